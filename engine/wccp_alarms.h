@@ -1,0 +1,18 @@
+// Alarms of a service group, and the client session on which alarms and state events go.
+#pragma once
+
+#include "engine/wccp_mgr.h"
+#include "runtime/common.h"
+
+struct gcl_session;
+extern gcl_session *qv_alm_mgmt_session; // null before it exists and after qv_alm_mgmt_deinit
+
+// Lock held.
+void wccp_alarm_schedule_verify_router_connectivity_timer(wccp_service_group *group, int restart);
+void wccp_alarm_schedule_verify_allocation_table_timer(wccp_service_group *group, int restart);
+int wccp_alarm_verify_router_connectivity(wccp_service_group *group);
+int wccp_alarms_verify_allocation_table(wccp_service_group *group);
+void wccp_alarm_raise_router_down_alarm(wccp_service_group *group);
+void wccp_alarms_clear_all_raised_alarms(wccp_service_group *group);
+// Takes the lock.
+void wccp_alarms_clear_all();

@@ -1,0 +1,7 @@
+#pragma once
+
+#include "engine/wccp_mgr.h"
+
+// The values that the group's mask spans, and their owners from bucket_ipa. Lock held.
+void wccp_mask_assignment_calculate_value_table(wccp_service_group *group);
+int wccp_mask_assignment_assign_mask_values(wccp_service_group *group);

@@ -1,0 +1,34 @@
+// Small things that the whole engine shares: address text for log lines, the assignment block, words for
+// codes.
+#pragma once
+
+#include "engine/wccp_mgr.h"
+#include "platform/qvcommon.h"
+#include "runtime/logging.h"
+
+// Dotted text of an address, by value: addr_text(ipa).s in the arguments of a log line.
+struct wccp_addr_text {
+    char s[46];
+};
+wccp_addr_text addr_text(be32 address);
+
+// Zeroes the block from dsg_appliance_count up to and including pending_acks.
+void wccp_clear_assignment_block(wccp_service_group *group);
+
+// "none", "gre", "L2", "gre or L2" and "none", "hash", "mask", "hash or mask"; "INVALID" from code 4 on.
+const char *wccp_method_name(uint32_t code);
+const char *wccp_assign_method_name(uint32_t code);
+
+// Number of 1 bits over the four fields, 0 for null.
+uint32_t util_wccp_mask_get_bits_set(const wccp_mask *mask);
+
+// The engine lock for a scope. Once it has the lock it looks whether its thread has been cancelled meanwhile
+// and ends there: a thread that waited through the stop of the engine never touches what was stopped.
+struct wccp_engine_lock {
+    wccp_engine_lock();
+    ~wccp_engine_lock();
+    wccp_engine_lock(const wccp_engine_lock &) = delete;
+    wccp_engine_lock &operator=(const wccp_engine_lock &) = delete;
+    void release();
+    bool held;
+};

@@ -1,0 +1,11 @@
+// Numbers of the appliance that do not change while the daemon runs, from /etc/opt/rvl/platform.conf: one
+// `name value` a line. A missing file means the defaults; a bad line is logged and passed over.
+#pragma once
+
+#include <cstdint>
+
+constexpr const char *PLATFORM_CONF_PATH = "/etc/opt/rvl/platform.conf";
+
+uint32_t get_max_user_tunnel_number(); // "max_user_tunnels"
+uint32_t get_max_tunnel_number();      // the same plus 22
+uint32_t qv_max_interfaces();          // "max_interfaces", 128 by default
