@@ -1,0 +1,26 @@
+#!/bin/bash
+# install-deps.sh WHAT...: installs what is missing for `build`, `lab`, `test` (Debian 12; as root or through sudo).
+set -eu
+build="g++ cmake ninja-build pkg-config libevent-dev libnuma-dev libmd-dev libnl-route-3-dev libcli11-dev nlohmann-json3-dev"
+lab="iproute2 util-linux procps mount"
+capture="tcpdump tshark"
+test="libgtest-dev libbenchmark-dev clang-14 libclang-rt-14-dev clang-format-14 clang-tidy-14 git jq $capture"
+wanted=
+for what in "$@"; do
+    case $what in build | lab | capture | test) wanted="$wanted ${!what}" ;; *) echo "install-deps.sh: what is $what?" >&2; exit 2 ;; esac
+done
+missing=
+for package in $wanted; do
+    [ "$(dpkg-query -W -f '${db:Status-Status}' "$package" 2>/dev/null)" = installed ] || missing="$missing $package"
+done
+[ -n "$missing" ] || exit 0
+sudo=; [ "$(id -u)" = 0 ] || sudo=sudo
+echo "installing:$missing"
+log=$(mktemp)
+trap 'rm -f "$log"' EXIT
+export DEBIAN_FRONTEND=noninteractive
+# shellcheck disable=SC2086
+if ! { $sudo apt-get update -q && $sudo env DEBIAN_FRONTEND=noninteractive apt-get install -yq --no-install-recommends $missing; } >"$log" 2>&1; then
+    tail -n 20 "$log" >&2
+    exit 1
+fi

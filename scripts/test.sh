@@ -1,0 +1,54 @@
+#!/bin/bash
+# test.sh: everything that a change has to pass, from a bare checkout on Debian 12: the form of the sources, all tests
+# under release and under the address and undefined-behaviour sanitizers, those with threads under the thread
+# sanitizer, a short run of each fuzzer. Installs what is missing; leaves nothing but build/.
+#   test.sh [STEP...]   only these steps, of: form release asan tsan clang tidy fuzz
+set -u
+cd "$(dirname "$0")/.." || exit 1
+scripts/install-deps.sh build lab test || exit 1
+jobs=$(nproc)
+steps=("$@"); [ $# -gt 0 ] || steps=(form release asan tsan clang fuzz)
+passed=0 failed=0
+declare -a bad=()
+
+note() { printf '\n== %s\n' "$*"; }
+result() { # NAME STATUS
+    if [ "$2" = 0 ]; then passed=$((passed + 1)); else failed=$((failed + 1)); bad+=("$1"); fi
+}
+sources() { git ls-files -co --exclude-standard '*.cpp' '*.h'; }
+build() { # PRESET
+    cmake --preset "$1" >"build/$1.log" 2>&1 && cmake --build --preset "$1" -j "$jobs" >>"build/$1.log" 2>&1 ||
+        { tail -n 40 "build/$1.log"; return 1; }
+}
+run_ctest() { # PRESET ARGUMENTS...
+    local preset=$1 out; shift
+    out=build/$preset/ctest.log
+    ctest --test-dir "build/$preset" -j $((jobs * 2)) --output-on-failure --no-tests=error "$@" >"$out" 2>&1
+    local status=$?
+    if [ $status -ne 0 ]; then grep -vE '^ *[0-9]+/[0-9]+ Test .* Passed|^ *Start ' "$out" | tail -n 150; fi
+    local total fails
+    total=$(sed -n 's/^.*tests passed, \([0-9]*\) tests failed out of \([0-9]*\).*/\2/p' "$out" | tail -n 1)
+    fails=$(sed -n 's/^.*tests passed, \([0-9]*\) tests failed out of \([0-9]*\).*/\1/p' "$out" | tail -n 1)
+    passed=$((passed + ${total:-0} - ${fails:-0})); failed=$((failed + ${fails:-0}))
+    if [ $status -ne 0 ]; then bad+=("tests under $preset"); [ "${fails:-0}" -gt 0 ] || failed=$((failed + 1)); fi
+}
+
+mkdir -p build
+for step in "${steps[@]}"; do
+    began=$SECONDS
+    note "$step"
+    case $step in
+    form) sources | xargs clang-format-14 --dry-run --Werror; result "form of the sources" $? ;;
+    release | asan) if build "$step"; then run_ctest "$step"; else result "build of $step" 1; fi ;;
+    tsan) if build tsan; then run_ctest tsan -L threads; else result "build of tsan" 1; fi ;;
+    clang) build clang; result "build with clang" $? ;;
+    tidy) cmake --preset clang >/dev/null && sources | grep '\.cpp$' | grep -vE '^(tests|bench|fuzz)/' |
+        xargs -P "$jobs" -n 4 clang-tidy-14 --quiet -p build/clang; result "clang-tidy" $? ;;
+    fuzz) scripts/fuzz.sh 15; result "fuzzing" $? ;;
+    *) echo "test.sh: no step $step" >&2; exit 2 ;;
+    esac
+    printf '%s: %d s\n' "$step" $((SECONDS - began))
+done
+[ ${#bad[@]} = 0 ] || printf 'failed: %s\n' "${bad[@]}"
+printf '\n%d passed, %d failed\n' "$passed" "$failed"
+[ "$failed" = 0 ]
