@@ -1,0 +1,16 @@
+// The text dumps of the engine's state, into display buffers of the caller. Each entry point takes the engine
+// lock for the time that it reads, so a dump is one consistent picture. 0, or 1 when the text did not fit.
+#pragma once
+
+#include "engine/wccp_mgr.h"
+#include "runtime/csys.h"
+
+constexpr uint32_t WCCP_DUMP_GLOBAL_BYTES = 1024;
+constexpr uint32_t WCCP_DUMP_GROUP_BYTES = 16384;
+constexpr uint32_t WCCP_DUMP_ASSIGNMENT_BYTES = 65536;
+constexpr uint32_t WCCP_DUMP_ALL_BYTES = 65536;
+
+int wccp_print_global(csys_display_buf *buffer);
+int wccp_print_all_wccp_info(csys_display_buf *buffer);
+int wccp_print_service_grp(csys_display_buf *buffer, int id);
+int wccp_print_service_grp_assignment_details(int id, csys_display_buf *buffer);
