@@ -9,3 +9,10 @@ constexpr const char *PLATFORM_CONF_PATH = "/etc/opt/rvl/platform.conf";
 uint32_t get_max_user_tunnel_number(); // "max_user_tunnels"
 uint32_t get_max_tunnel_number();      // the same plus 22
 uint32_t qv_max_interfaces();          // "max_interfaces", 128 by default
+
+// What the first of the above reads, once: the file's numbers over the defaults.
+struct platform_limits {
+    uint32_t max_user_tunnels;
+    uint32_t max_interfaces;
+};
+platform_limits platform_limits_read(const char *path);

@@ -1,0 +1,185 @@
+// The process-wide table of GRE tunnels.
+//
+// One record for each pair of this appliance's address and a router's id; service groups that share the pair
+// share the tunnel and are counted in `ref_count`. The table hands out tunnel ids from a range of 32, one for
+// each bit of a bitmap: a clear bit means that a record holds the id or that an add for it is under way.
+// What tunneld is told goes through the mailbox (wccpd_common.cpp), which waits for the answer.
+//
+// The tunnel mutex covers the list and the bitmap. It stands behind the engine lock and before the mailbox's
+// own. An add lets go of it while it waits for tunneld; a delete and a restore hold it through the wait. Two
+// adds for one new key are kept apart by the engine lock, which every caller of wccp_add_tunnel holds.
+//
+// A caller can be cancelled in each of these waits. An add that ends so gives back its id and its record; a
+// delete still takes its record out of the table, as after a delete that failed, and nobody is left with the
+// mutex. From the moment when a new record is in the table until wccp_add_tunnel has returned there is no
+// cancellation, so a caller that notes its reference first thing never loses one.
+
+#include "engine/wccp_tunnel.h"
+
+#include <cstdio>
+
+#include "engine/wccp_host.h"
+#include "engine/wccp_utils.h"
+#include "engine/wccpd_common.h"
+#include "runtime/guards.h"
+#include "runtime/logging.h"
+
+static pthread_mutex_t tunnel_mutex = PTHREAD_MUTEX_INITIALIZER;
+static wccp_tunnel *tunnel_list; // newest first
+static uint32_t tunnel_free_ids = 0xFFFFFFFF;
+
+static mailbox_address mailbox_address_of(be32 address) {
+    return {{to_host(address), 0}};
+}
+
+static void free_tunnel(wccp_tunnel *tunnel) {
+    wccp_free(tunnel);
+}
+
+// tunnel_mutex held.
+static wccp_tunnel *find_tunnel(be32 local, be32 remote) {
+    for (wccp_tunnel *tunnel = tunnel_list; tunnel; tunnel = tunnel->next)
+        if (tunnel->local_ipa == local && tunnel->remote_ipa == remote)
+            return tunnel;
+    return nullptr;
+}
+
+// tunnel_mutex held.
+static void give_id_back(uint32_t id) {
+    if (id >= g_qv_encap_wccp_first && id <= g_qv_encap_wccp_last && id - g_qv_encap_wccp_first < 32)
+        tunnel_free_ids |= 1u << (id - g_qv_encap_wccp_first);
+}
+
+namespace {
+
+// The id of an add that is under way. Given back unless the record that holds it made it into the table.
+struct owned_tunnel_id {
+    ~owned_tunnel_id() {
+        if (taken) {
+            const mutex_guard guard(&tunnel_mutex);
+            give_id_back(id);
+        }
+    }
+    bool take_lowest() {
+        const mutex_guard guard(&tunnel_mutex);
+        if (tunnel_free_ids == 0)
+            return false;
+        const uint32_t bit = static_cast<uint32_t>(__builtin_ctz(tunnel_free_ids));
+        id = static_cast<uint16_t>(g_qv_encap_wccp_first + bit);
+        if (id == 65535)
+            return false;
+        tunnel_free_ids &= ~(1u << bit);
+        taken = true;
+        return true;
+    }
+    uint16_t id = 0;
+    bool taken = false;
+};
+
+// Takes a record out of the table at the end of the scope, however that comes. tunnel_mutex held.
+struct tunnel_removal {
+    explicit tunnel_removal(wccp_tunnel *removed) : tunnel(removed) {}
+    ~tunnel_removal() {
+        list_unlink(tunnel);
+        give_id_back(tunnel->tunnel_id);
+        free_tunnel(tunnel);
+    }
+    tunnel_removal(const tunnel_removal &) = delete;
+    tunnel_removal &operator=(const tunnel_removal &) = delete;
+    wccp_tunnel *tunnel;
+};
+
+} // namespace
+
+int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
+    const int group = static_cast<int>(group_id & 0xff);
+    {
+        const mutex_guard guard(&tunnel_mutex);
+        if (wccp_tunnel *tunnel = find_tunnel(local, remote)) {
+            tunnel->ref_count.fetch_add(1);
+            return 0;
+        }
+    }
+    owned<wccp_tunnel, free_tunnel> tunnel(static_cast<wccp_tunnel *>(wccp_calloc(1, sizeof(wccp_tunnel))));
+    if (!tunnel.pointer) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: Failed to alloc tunnel memory", group);
+        return 1;
+    }
+    tunnel.pointer->dataplane_index = WCCP_NO_INDEX;
+    owned_tunnel_id id;
+    if (!id.take_lowest()) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: No free tunnel id available", group);
+        return 1;
+    }
+    if (wccp_add_tunnel_encap(id.id, mailbox_address_of(local), mailbox_address_of(remote),
+                              &tunnel.pointer->dataplane_index) == 1) {
+        QV_LOG(LC_LOG_NOTICE, "WCCP GRP %d: failed to add tunnel: id: %d %s <=> %s", group, id.id,
+               addr_text(local).s, addr_text(remote).s);
+        return 1;
+    }
+    const cancel_off_guard whole;
+    tunnel.pointer->tunnel_id = id.id;
+    tunnel.pointer->local_ipa = local;
+    tunnel.pointer->remote_ipa = remote;
+    tunnel.pointer->ref_count.store(1);
+    {
+        const mutex_guard guard(&tunnel_mutex);
+        list_push_head(&tunnel_list, tunnel.take());
+        id.taken = false;
+    }
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: created GRE tunnel id %d %s <=> %s", group, id.id, addr_text(local).s,
+           addr_text(remote).s);
+    return 0;
+}
+
+int wccp_del_tunnel(uint32_t group_id, be32 local, be32 remote, int force) {
+    char group[16] = " ";
+    if (group_id & 0xff)
+        snprintf(group, sizeof group, " GRP %d", static_cast<int>(group_id & 0xff));
+    const mutex_guard guard(&tunnel_mutex);
+    wccp_tunnel *tunnel = find_tunnel(local, remote);
+    if (!tunnel)
+        return 0;
+    if (!force && tunnel->ref_count.fetch_sub(1) > 1)
+        return 0;
+    const tunnel_removal removal(tunnel);
+    const int result = wccp_del_tunnel_encap(tunnel->tunnel_id, mailbox_address_of(local),
+                                             mailbox_address_of(remote), &tunnel->dataplane_index);
+    if (result != 1) {
+        QV_LOG(LC_LOG_INFO, "WCCP%s: deleted GRE tunnel id: %d %s <=> %s", group, tunnel->tunnel_id,
+               addr_text(local).s, addr_text(remote).s);
+        return 0;
+    }
+    if (wccpd_exiting.load() == 1)
+        return 0;
+    QV_LOG(LC_LOG_WARNING, "WCCP%s: failed to delete GRE tunnel id: %d %s <=> %s", group, tunnel->tunnel_id,
+           addr_text(local).s, addr_text(remote).s);
+    return 1;
+}
+
+// The mutex is free between two deletes, so the walk goes by the head of the list: each delete takes that
+// record out, and no pointer is kept that another thread could free meanwhile.
+int wccp_del_all_tunnels() {
+    for (;;) {
+        be32 local, remote;
+        {
+            const mutex_guard guard(&tunnel_mutex);
+            if (!tunnel_list)
+                return 0;
+            local = tunnel_list->local_ipa;
+            remote = tunnel_list->remote_ipa;
+        }
+        wccp_del_tunnel(0, local, remote, 1);
+    }
+}
+
+int wccp_restore_all_tunnels() {
+    QV_LOG(LC_LOG_INFO, "WCCP: Restore all gre tunnels");
+    const mutex_guard guard(&tunnel_mutex);
+    for (wccp_tunnel *tunnel = tunnel_list; tunnel; tunnel = tunnel->next)
+        if (wccp_add_tunnel_encap(tunnel->tunnel_id, mailbox_address_of(tunnel->local_ipa),
+                                  mailbox_address_of(tunnel->remote_ipa), &tunnel->dataplane_index) == 1)
+            QV_LOG(LC_LOG_NOTICE, "WCCP:retore tunnel: failed to create tunnel. id: %d %s <=> %s",
+                   tunnel->tunnel_id, addr_text(tunnel->local_ipa).s, addr_text(tunnel->remote_ipa).s);
+    return 0;
+}

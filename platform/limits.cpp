@@ -1,0 +1,107 @@
+// The appliance's limits.
+//
+// The file is read once, by the first question of whichever thread, and never again: the ids of the tunnels
+// and the size of the interface table hang from these numbers, so they must not move under a running daemon.
+//
+// A number that would push the last reserved encapsulation entry (max_user_tunnels + 22 + 84) past the 16-bit
+// tunnel ids counts as a bad line, and so does one that leaves no interface at all.
+
+#include "platform/limits.h"
+
+#include <pthread.h>
+
+#include <cctype>
+#include <cerrno>
+#include <cstddef>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "runtime/guards.h"
+#include "runtime/logging.h"
+
+static constexpr uint32_t TUNNELS_OF_THE_SYSTEM = 22;
+
+static constexpr platform_limits defaults = {.max_user_tunnels = 200, .max_interfaces = 128};
+
+static const struct {
+    const char *name;
+    size_t offset;
+    uint32_t least, most;
+} known_limits[] = {
+    {"max_user_tunnels", offsetof(platform_limits, max_user_tunnels), 0, 65000},
+    {"max_interfaces", offsetof(platform_limits, max_interfaces), 1, 65535},
+};
+
+static const char *skip_blanks(const char *text) {
+    while (*text == ' ' || *text == '\t')
+        text++;
+    return text;
+}
+
+// Takes one line over, or tells that it can't be one of ours.
+static bool take_line(const char *line, platform_limits *limits) {
+    const char *at = skip_blanks(line);
+    if (*at == '\0' || *at == '#')
+        return true;
+    for (const auto &limit : known_limits) {
+        const size_t length = strlen(limit.name);
+        if (strncmp(at, limit.name, length) != 0 || (at[length] != ' ' && at[length] != '\t'))
+            continue;
+        at = skip_blanks(at + length);
+        if (!isdigit(static_cast<unsigned char>(*at)))
+            return false;
+        char *end = nullptr;
+        errno = 0;
+        const unsigned long value = strtoul(at, &end, 10);
+        if (errno != 0 || *skip_blanks(end) != '\0' || value < limit.least || value > limit.most)
+            return false;
+        const uint32_t number = static_cast<uint32_t>(value);
+        memcpy(reinterpret_cast<char *>(limits) + limit.offset, &number, sizeof number);
+        return true;
+    }
+    return false;
+}
+
+platform_limits platform_limits_read(const char *path) {
+    const cancel_off_guard whole; // the file is closed at the end, cancelled or not
+    platform_limits limits = defaults;
+    FILE *file = fopen(path, "re");
+    if (!file) {
+        if (errno != ENOENT)
+            QV_LOG(LC_LOG_WARNING, "%s: cannot be read (%m), defaults taken", path);
+        return limits;
+    }
+    char line[128];
+    for (unsigned number = 1; fgets(line, sizeof line, file); number++) {
+        const bool whole_line = strchr(line, '\n') != nullptr || feof(file);
+        if (!whole_line) { // the rest of a line that is longer than any good one
+            int c;
+            while ((c = fgetc(file)) != EOF && c != '\n')
+                ;
+        }
+        line[strcspn(line, "\r\n")] = '\0';
+        if ((!whole_line && *skip_blanks(line) != '#') || !take_line(line, &limits))
+            QV_LOG(LC_LOG_WARNING, "%s: bad line %u passed over: %s", path, number, line);
+    }
+    fclose(file);
+    return limits;
+}
+
+static platform_limits current;
+static pthread_once_t current_once = PTHREAD_ONCE_INIT;
+
+static const platform_limits *limits_of_this_run() {
+    pthread_once(&current_once, [] { current = platform_limits_read(PLATFORM_CONF_PATH); });
+    return &current;
+}
+
+uint32_t get_max_user_tunnel_number() {
+    return limits_of_this_run()->max_user_tunnels;
+}
+uint32_t get_max_tunnel_number() {
+    return get_max_user_tunnel_number() + TUNNELS_OF_THE_SYSTEM;
+}
+uint32_t qv_max_interfaces() {
+    return limits_of_this_run()->max_interfaces;
+}

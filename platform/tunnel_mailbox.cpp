@@ -1,0 +1,131 @@
+// The mailbox as tunneld uses it, and the attaching that both sides share.
+//
+// Nothing here takes a lock: tunneld has one thread for its commands, and a role is one load. Every field is
+// read and written as one access of its own width with acquire and release order, so that neither the
+// compiler nor the machine moves an input across the `command` that hands it over.
+//
+// wccpd gives up a command after about two seconds and may then put another in its place, while tunneld is
+// still reading. So the inputs are read twice with looks at `command` around and between: wccpd takes
+// `command` to 0 before it touches an input, hence inputs that agree with no 0 in between belong to one
+// command. A reader that never gets there (wccpd writing for ever) takes what it has; it looks at `command`
+// again before it acts.
+
+#include "platform/tunnel_mailbox.h"
+
+#include <sys/shm.h>
+
+#include "runtime/cmem.h"
+#include "runtime/logging.h"
+
+wccp_tunnel_mailbox *wccp_mailbox;
+wccp_policy_role *wccp_mailbox_roles;
+
+template <typename T>
+static T get(const T &field) {
+    return __atomic_load_n(&field, __ATOMIC_ACQUIRE);
+}
+template <typename T>
+static void put(T &field, T value) {
+    __atomic_store_n(&field, value, __ATOMIC_RELEASE);
+}
+
+bool wccp_attach_mailbox() {
+    if (get(wccp_mailbox))
+        return true;
+    if (cmem_exists_block(WCCP_MAILBOX_NAME) != 1)
+        return false;
+    uint64_t length = 0;
+    void *block = cmem_attach_block(WCCP_MAILBOX_NAME, &length);
+    if (!block)
+        return false;
+    if (length < sizeof(wccp_tunnel_mailbox)) {
+        QV_LOG(LC_LOG_ERR, "Block %s has %lu bytes in place of %lu and is not used", WCCP_MAILBOX_NAME,
+               static_cast<unsigned long>(length), static_cast<unsigned long>(sizeof(wccp_tunnel_mailbox)));
+        shmdt(block);
+        return false;
+    }
+    auto *mailbox = static_cast<wccp_tunnel_mailbox *>(block);
+    put(wccp_mailbox_roles, &mailbox->policy_roles[0]);
+    put(wccp_mailbox, mailbox);
+    return true;
+}
+
+uint16_t wccp_get_tunnel_command() {
+    if (!wccp_attach_mailbox())
+        return MAILBOX_IDLE;
+    return wccp_mailbox->command.load(std::memory_order_acquire);
+}
+
+namespace {
+
+struct inputs {
+    uint16_t tunnel_id;
+    uint32_t local_ip, remote_ip, fmst_index;
+    uint8_t l2_group;
+    uint32_t l2_value;
+    bool operator==(const inputs &) const = default;
+};
+
+inputs read_once(const wccp_tunnel_mailbox *mailbox) {
+    return {get(mailbox->tunnel_id),  get(mailbox->local_ip), get(mailbox->remote_ip),
+            get(mailbox->fmst_index), get(mailbox->l2_group), get(mailbox->l2_value)};
+}
+
+inputs read_inputs(const wccp_tunnel_mailbox *mailbox) {
+    for (int tries = 0;; tries++) {
+        const uint16_t before = mailbox->command.load(std::memory_order_acquire);
+        const inputs first = read_once(mailbox);
+        const uint16_t between = mailbox->command.load(std::memory_order_acquire);
+        const inputs second = read_once(mailbox);
+        const uint16_t after = mailbox->command.load(std::memory_order_acquire);
+        const bool whole = before == between && between == after && before != MAILBOX_IDLE && first == second;
+        if (whole || after == MAILBOX_IDLE || tries == 1000)
+            return second;
+    }
+}
+
+} // namespace
+
+void wccp_get_tunnel_parameters(uint16_t *out_tunnel_id, mailbox_address *out_local,
+                                mailbox_address *out_remote, uint32_t *out_index) {
+    const wccp_tunnel_mailbox *mailbox = get(wccp_mailbox);
+    if (!mailbox)
+        return;
+    const inputs read = read_inputs(mailbox);
+    *out_tunnel_id = read.tunnel_id;
+    *out_local = {{read.local_ip, 0}};
+    *out_remote = {{read.remote_ip, 0}};
+    *out_index = read.fmst_index;
+}
+
+void wccp_get_config_paramters(uint8_t *out_group, uint32_t *out_value) {
+    const wccp_tunnel_mailbox *mailbox = get(wccp_mailbox);
+    if (!mailbox)
+        return;
+    const inputs read = read_inputs(mailbox);
+    *out_group = read.l2_group;
+    *out_value = read.l2_value;
+}
+
+void wccp_set_fmst_index(uint32_t index) {
+    if (wccp_tunnel_mailbox *mailbox = get(wccp_mailbox))
+        put(mailbox->fmst_index, index);
+}
+
+uint32_t wccp_get_fmst_index() {
+    const wccp_tunnel_mailbox *mailbox = get(wccp_mailbox);
+    return mailbox ? get(mailbox->fmst_index) : WCCP_NO_INDEX;
+}
+
+void wccp_set_tunnel_command_status(uint32_t status) {
+    if (wccp_tunnel_mailbox *mailbox = get(wccp_mailbox)) {
+        put(mailbox->status, status);
+        mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
+    }
+}
+
+uint32_t wccp_get_role(uint16_t policy_group) {
+    if (!wccp_attach_mailbox())
+        return 2;
+    return wccp_mailbox_roles[policy_group].role.load(std::memory_order_relaxed);
+}
