@@ -1,0 +1,375 @@
+// Link and address notifications from rtnetlink.
+//
+// One thread, started by the first qv_start_netlink_monitor and there until the process is gone, owns
+// everything below but the callbacks, the set of started kinds and the set of kinds that want a look: the
+// table of interfaces by index and the socket that hears the kernel's notifications. It blocks every signal,
+// and sleeps until the kernel says something.
+//
+// What a program is told. A link state event is a change of an interface's name, administrative state or
+// operational state (IFF_UP, IFF_RUNNING); a notification that changes none of these is no event. An address
+// event is any notification about an IPv4 address of the interface. A name that goes (deleted, renamed, moved
+// to another namespace) is told as down, with an address event behind it, before a name that comes is told,
+// unless another interface has it by then. When a kind starts, every interface is told once, so that a change
+// between the caller's own look and the start isn't lost.
+//
+// Loss. When the kernel's queue has overrun (a storm, or a callback that took long) or a notification names
+// an interface that we don't know, nothing that is queued can be trusted: what is older than the loss would
+// undo what a look has found. So the queue is emptied first, and then every interface is asked for, told as
+// changed or not; what vanished is told as down, and a name that now belongs to another interface is told as
+// down and again as it is. Notifications that come during the look are read after it, and end in the latest
+// state. A look that fails is tried again a little later.
+//
+// The process may be in exit() while this thread runs. Hence no object here has a destructor, and of libnl
+// only the core is used, whose code has none either; libnl-route's objects hang from tables that its
+// destructors take down.
+
+#include "platform/qvcommon_netlink.h"
+
+#include <linux/if_addr.h>
+#include <linux/if_link.h>
+#include <linux/rtnetlink.h>
+#include <net/if.h>
+#include <netlink/msg.h>
+#include <netlink/netlink.h>
+#include <netlink/socket.h>
+#include <poll.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+
+#include "runtime/guards.h"
+
+namespace {
+
+constexpr int RECEIVE_BUFFER_BYTES = 208 * 1024;
+constexpr int LOOK_AGAIN_MS = 200;
+constexpr int LOOK_TRIES = 5; // a look is inconsistent when interfaces change during it
+#ifdef WCCP_SANITIZED
+constexpr size_t STACK_BYTES = 512 * 1024;
+#else
+constexpr size_t STACK_BYTES = 128 * 1024;
+#endif
+
+struct interface {
+    int index;
+    char name[IFNAMSIZ]; // empty: another interface has taken the name
+    uint32_t admin_up, link_up;
+};
+struct interface_table {
+    interface *entries;
+    uint32_t count, room;
+};
+
+std::atomic<qv_netlink_callback> callbacks[QV_NOTIFY_KINDS];
+std::atomic<uint32_t> started;     // bit by kind
+std::atomic<uint32_t> look_wanted; // bit by kind
+int wake_fd = -1;                  // an eventfd: look_wanted has changed
+pthread_mutex_t start_mutex = PTHREAD_MUTEX_INITIALIZER;
+bool running; // start_mutex
+
+// The thread's own.
+nl_sock *monitor_socket;
+interface_table known;
+
+void tell_link(const char *name, uint32_t admin_up, uint32_t link_up) {
+    if (!name[0] || !(started.load(std::memory_order_acquire) & (1u << QV_NOTIFY_LINK_STATE)))
+        return;
+    qv_if_state_info info = {};
+    memcpy(info.name, name, sizeof info.name);
+    info.admin_up = admin_up;
+    info.link_up = link_up;
+    callbacks[QV_NOTIFY_LINK_STATE].load(std::memory_order_acquire)(&info);
+}
+
+void tell_address(const char *name) {
+    if (!name[0] || !(started.load(std::memory_order_acquire) & (1u << QV_NOTIFY_IPA_CHANGE)))
+        return;
+    char copy[IFNAMSIZ];
+    memcpy(copy, name, sizeof copy);
+    callbacks[QV_NOTIFY_IPA_CHANGE].load(std::memory_order_acquire)(copy);
+}
+
+interface *find_index(const interface_table *table, int index) {
+    for (uint32_t i = 0; i < table->count; i++)
+        if (table->entries[i].index == index)
+            return &table->entries[i];
+    return nullptr;
+}
+
+interface *find_name(const interface_table *table, const char *name) {
+    for (uint32_t i = 0; i < table->count; i++)
+        if (strncmp(table->entries[i].name, name, IFNAMSIZ) == 0)
+            return &table->entries[i];
+    return nullptr;
+}
+
+bool append(interface_table *table, const interface *entry) {
+    if (table->count == table->room) {
+        const uint32_t room = table->room ? table->room * 2 : 16;
+        void *grown = realloc(table->entries, room * sizeof(interface));
+        if (!grown)
+            return false;
+        table->entries = static_cast<interface *>(grown);
+        table->room = room;
+    }
+    table->entries[table->count++] = *entry;
+    return true;
+}
+
+// A name that no interface carries any more.
+void tell_gone(const char *name) {
+    tell_link(name, 0, 0);
+    tell_address(name);
+}
+
+bool read_link(nlmsghdr *header, interface *out) {
+    nlattr *attributes[IFLA_MAX + 1];
+    if (nlmsg_parse(header, sizeof(ifinfomsg), attributes, IFLA_MAX, nullptr) < 0)
+        return false;
+    const auto *link = static_cast<const ifinfomsg *>(nlmsg_data(header));
+    // A bridge tells of its ports in messages of its own family; a port that leaves is not an interface that
+    // goes.
+    if (link->ifi_family != AF_UNSPEC || !attributes[IFLA_IFNAME])
+        return false;
+    *out = {};
+    out->index = link->ifi_index;
+    nla_strlcpy(out->name, attributes[IFLA_IFNAME], sizeof out->name);
+    out->admin_up = (link->ifi_flags & IFF_UP) ? 1 : 0;
+    out->link_up = (link->ifi_flags & IFF_RUNNING) ? 1 : 0;
+    return out->name[0] != '\0';
+}
+
+void want_look() {
+    look_wanted.fetch_or((1u << QV_NOTIFY_KINDS) - 1, std::memory_order_acq_rel);
+}
+
+void link_is(const interface *now) {
+    interface *holder = find_name(&known, now->name);
+    if (holder && holder->index != now->index)
+        holder->name[0] = '\0'; // the message that tells where it went is still to come
+    interface *before = find_index(&known, now->index);
+    if (!before) {
+        if (!append(&known, now))
+            return want_look();
+        tell_link(now->name, now->admin_up, now->link_up);
+        tell_address(now->name);
+        return;
+    }
+    const interface old = *before;
+    *before = *now;
+    const bool renamed = strncmp(old.name, now->name, IFNAMSIZ) != 0;
+    if (renamed && old.name[0])
+        tell_gone(old.name);
+    if (renamed || old.admin_up != now->admin_up || old.link_up != now->link_up)
+        tell_link(now->name, now->admin_up, now->link_up);
+    if (renamed)
+        tell_address(now->name);
+}
+
+void link_gone(int index) {
+    interface *entry = find_index(&known, index);
+    if (!entry)
+        return;
+    const interface old = *entry;
+    *entry = known.entries[--known.count];
+    if (old.name[0])
+        tell_gone(old.name);
+}
+
+int on_notification(nl_msg *message, void *) {
+    nlmsghdr *header = nlmsg_hdr(message);
+    interface link;
+    switch (header->nlmsg_type) {
+    case RTM_NEWLINK:
+        if (read_link(header, &link))
+            link_is(&link);
+        break;
+    case RTM_DELLINK:
+        if (read_link(header, &link))
+            link_gone(link.index);
+        break;
+    case RTM_NEWADDR:
+    case RTM_DELADDR:
+        if (nlmsg_valid_hdr(header, sizeof(ifaddrmsg))) {
+            const auto *address = static_cast<const ifaddrmsg *>(nlmsg_data(header));
+            char name[IFNAMSIZ];
+            if (const interface *entry = find_index(&known, static_cast<int>(address->ifa_index)))
+                tell_address(entry->name);
+            else if (if_indextoname(address->ifa_index, name))
+                want_look(); // not one that is gone already
+        }
+        break;
+    default:
+        break;
+    }
+    return NL_OK;
+}
+
+int on_look_answer(nl_msg *message, void *table) {
+    nlmsghdr *header = nlmsg_hdr(message);
+    interface link;
+    if (header->nlmsg_type == RTM_NEWLINK && read_link(header, &link) &&
+        !append(static_cast<interface_table *>(table), &link))
+        return -NLE_NOMEM;
+    return NL_OK;
+}
+
+// Everything that the monitor socket holds, unread. A queue can't hold more than a few thousand messages.
+void empty_queue() {
+    char byte;
+    for (int i = 0; i < 100000; i++)
+        if (recv(nl_socket_get_fd(monitor_socket), &byte, 1, MSG_DONTWAIT) < 0 && errno != ENOBUFS &&
+            errno != EINTR)
+            return;
+}
+
+nl_sock *open_socket() {
+    nl_sock *socket = nl_socket_alloc();
+    if (socket && nl_connect(socket, NETLINK_ROUTE) == 0)
+        return socket;
+    nl_socket_free(socket);
+    return nullptr;
+}
+
+// Asks the kernel for all interfaces. False when there is no whole answer.
+bool ask_for_all(interface_table *out) {
+    nl_sock *socket = open_socket();
+    if (!socket)
+        return false;
+    nl_socket_modify_cb(socket, NL_CB_VALID, NL_CB_CUSTOM, on_look_answer, out);
+    int result = -NLE_DUMP_INTR;
+    for (int tries = 0; tries < LOOK_TRIES && result == -NLE_DUMP_INTR; tries++) {
+        ifinfomsg all = {};
+        out->count = 0;
+        result = nl_send_simple(socket, RTM_GETLINK, NLM_F_DUMP, &all, sizeof all);
+        if (result >= 0)
+            result = nl_recvmsgs_default(socket);
+    }
+    nl_socket_free(socket);
+    return result >= 0;
+}
+
+bool look_at_all(uint32_t kinds) {
+    empty_queue();
+    interface_table fresh = {};
+    if (!ask_for_all(&fresh)) {
+        free(fresh.entries);
+        return false;
+    }
+    interface_table old = known;
+    known = fresh;
+    for (uint32_t i = 0; i < old.count; i++) {
+        const interface *now = find_index(&known, old.entries[i].index);
+        if (!now || strncmp(now->name, old.entries[i].name, IFNAMSIZ) != 0)
+            tell_gone(old.entries[i].name);
+    }
+    free(old.entries);
+    for (uint32_t i = 0; i < known.count; i++) {
+        const interface entry = known.entries[i];
+        if (kinds & (1u << QV_NOTIFY_LINK_STATE))
+            tell_link(entry.name, entry.admin_up, entry.link_up);
+        if (kinds & (1u << QV_NOTIFY_IPA_CHANGE))
+            tell_address(entry.name);
+    }
+    return true;
+}
+
+void *monitor(void *) {
+    for (;;) {
+        int wait = -1;
+        if (const uint32_t kinds = look_wanted.exchange(0, std::memory_order_acq_rel)) {
+            if (!look_at_all(kinds)) {
+                look_wanted.fetch_or(kinds, std::memory_order_acq_rel);
+                wait = LOOK_AGAIN_MS;
+            }
+        }
+        pollfd fds[2] = {{nl_socket_get_fd(monitor_socket), POLLIN, 0}, {wake_fd, POLLIN, 0}};
+        if (poll(fds, 2, wait) < 0)
+            continue;
+        uint64_t ignored;
+        if (fds[1].revents && read(wake_fd, &ignored, sizeof ignored) < 0)
+            continue;
+        if (fds[0].revents) {
+            const int result = nl_recvmsgs_default(monitor_socket);
+            if (result < 0 && result != -NLE_AGAIN && result != -NLE_INTR)
+                want_look();
+        }
+    }
+    return nullptr;
+}
+
+void close_all() {
+    nl_socket_free(monitor_socket);
+    if (wake_fd >= 0)
+        close(wake_fd);
+    monitor_socket = nullptr;
+    wake_fd = -1;
+}
+
+bool open_all() {
+    monitor_socket = open_socket();
+    wake_fd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+    if (!monitor_socket || wake_fd < 0)
+        return false;
+    nl_socket_disable_seq_check(monitor_socket);
+    nl_socket_modify_cb(monitor_socket, NL_CB_VALID, NL_CB_CUSTOM, on_notification, nullptr);
+    return nl_socket_set_nonblocking(monitor_socket) == 0 &&
+           nl_socket_set_buffer_size(monitor_socket, RECEIVE_BUFFER_BYTES, 0) == 0 &&
+           nl_socket_add_memberships(monitor_socket, RTNLGRP_LINK, RTNLGRP_IPV4_IFADDR, RTNLGRP_NONE) == 0;
+}
+
+int start_thread() {
+    pthread_attr_t attributes;
+    if (const int error = pthread_attr_init(&attributes))
+        return error;
+    pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
+    pthread_attr_setstacksize(&attributes, STACK_BYTES);
+    sigset_t all, previous;
+    sigfillset(&all);
+    pthread_sigmask(SIG_SETMASK, &all, &previous); // the thread inherits it
+    pthread_t thread;
+    const int error = pthread_create(&thread, &attributes, monitor, nullptr);
+    pthread_sigmask(SIG_SETMASK, &previous, nullptr);
+    pthread_attr_destroy(&attributes);
+    if (error == 0)
+        pthread_setname_np(thread, "qv_netlink");
+    return error;
+}
+
+} // namespace
+
+int qv_netlink_register(uint32_t kind, qv_netlink_callback callback) {
+    if (kind >= QV_NOTIFY_KINDS || !callback)
+        return EINVAL;
+    callbacks[kind].store(callback, std::memory_order_release);
+    return 0;
+}
+
+int qv_netlink_start(uint32_t kind) {
+    if (kind >= QV_NOTIFY_KINDS || !callbacks[kind].load(std::memory_order_acquire))
+        return EINVAL;
+    const cancel_off_guard whole;
+    const mutex_guard guard(&start_mutex);
+    int error = 0;
+    if (!running) {
+        error = open_all() ? start_thread() : EIO;
+        if (error == 0)
+            running = true;
+        else
+            close_all();
+    }
+    if (error == 0) {
+        started.fetch_or(1u << kind, std::memory_order_acq_rel);
+        look_wanted.fetch_or(1u << kind, std::memory_order_acq_rel);
+        const uint64_t one = 1;
+        if (write(wake_fd, &one, sizeof one) < 0)
+            error = EIO;
+    }
+    return error;
+}

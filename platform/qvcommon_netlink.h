@@ -1,0 +1,11 @@
+// The netlink side of libqvcommondyn.so, for its other file only: what is exported stands in qvcommon.h.
+#pragma once
+
+#include <cstdint>
+
+#include "platform/qvcommon.h"
+
+constexpr uint32_t QV_NOTIFY_KINDS = 2;
+
+int qv_netlink_register(uint32_t kind, qv_netlink_callback callback);
+int qv_netlink_start(uint32_t kind);
