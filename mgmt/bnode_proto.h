@@ -1,0 +1,194 @@
+// Management messages: the records, building and reading them, and sending them on a session.
+//
+// A request carries an ordered list of nodes, each with a binding; a response carries the bindings that
+// answer. On the wire a message is the body of a frame of protocol 2, "bnode". Receiving ends in one callback
+// for each message type, which runs inside the locks of the instance and the session; the message stays the
+// receive path's, a callback that keeps it takes a copy. What a callback returns is dropped.
+#pragma once
+
+#include <cstdint>
+
+#include "mgmt/bnode.h"
+#include "mgmt/gcl.h"
+#include "runtime/tbuffer.h"
+#include "runtime/tstring.h"
+#include "runtime/typed_arrays.h"
+
+// Message types, the same number in the message header and in the frame. Even ones are responses.
+enum : uint16_t {
+    bn_msg_none = 0,
+    bn_msg_query_request = 1,
+    bn_msg_query_response = 2,
+    bn_msg_set_request = 3,
+    bn_msg_set_response = 4,
+    bn_msg_action_request = 5,
+    bn_msg_action_response = 6,
+    bn_msg_event = 7,
+    bn_msg_event_ack = 8,
+};
+enum : uint32_t { bn_query_none = 0, bn_query_get = 1, bn_query_iterate = 2, bn_query_registration_info = 3 };
+enum : uint32_t {
+    bn_set_none = 0,
+    bn_set_create = 1,
+    bn_set_delete = 2,
+    bn_set_reset = 3,
+    bn_set_modify = 4,
+    bn_set_reparent = 5,
+};
+// Query flags of a node.
+enum : uint32_t {
+    bn_qf_walk_only = 0x200,
+    bn_qf_subtree = 0x1000,
+    bn_qf_include_self = 0x2000,
+    bn_qf_leaves_only = 0x4000,
+};
+constexpr uint16_t BN_PROTO = 2;
+constexpr uint32_t BN_FRAME_HEADER_BYTES = 32;
+
+extern const lc_enum_entry bn_msg_type_table[];
+extern const lc_enum_entry bn_query_subop_table[];
+extern const lc_enum_entry bn_set_subop_table[];
+
+struct bn_request_node {
+    uint32_t node_id;
+    bn_binding *binding; // owned
+    uint32_t msg_type;
+    uint32_t subop; // query and set
+    uint32_t flags;
+    tstring *source; // set, "reparent" only; owned
+    tstring *target;
+};
+struct bn_response_node {
+    uint32_t node_id;
+    bn_binding *binding; // owned
+    uint32_t msg_type;
+};
+struct bn_request_per_node_array;
+struct bn_response_per_node_array;
+
+struct bn_request_msg {
+    uint16_t service_id;
+    uint16_t msg_type;
+    uint32_t length;
+    uint32_t msg_id;
+    uint32_t transaction_id;
+    tstring *audit_user; // or null
+    bn_request_per_node_array *nodes;
+    uint32_t flags;        // query: flags; set: commit flags
+    tstring *text;         // query: database name; set: text; action: its name; event: its name
+    uint32_t number;       // query: revision id condition; set: number
+    uint32_t next_node_id; // starts at 1000
+};
+struct bn_response_msg {
+    uint16_t service_id;
+    uint16_t msg_type;
+    uint32_t length;
+    uint32_t msg_id;
+    uint32_t transaction_id;
+    uint32_t response_to;
+    uint32_t return_code;
+    tstring *return_message;
+    bn_response_per_node_array *nodes;
+    uint32_t db_revision_id; // query and set responses
+};
+
+// What bn_request_get tells of a request's node beside its binding.
+struct bn_node_info {
+    uint32_t subop;
+    uint32_t flags;
+};
+
+uint16_t bn_request_msg_response_msg_type(uint16_t request_type);
+
+// Building requests.
+lc_status bn_request_msg_create(bn_request_msg **out, uint16_t type);
+lc_status bn_query_request_msg_create(bn_request_msg **out, uint32_t flags, const char *database);
+lc_status bn_set_request_msg_create(bn_request_msg **out, uint32_t commit_flags);
+lc_status bn_action_request_msg_create(bn_request_msg **out, const char *action_name);
+lc_status bn_event_request_msg_create(bn_request_msg **out, const char *event_name);
+lc_status bn_query_request_msg_append_str(bn_request_msg *msg, uint32_t subop, uint32_t flags,
+                                          const char *node_name, uint32_t *out_node_id);
+lc_status bn_query_request_msg_append_with_attribs(bn_request_msg *msg, uint32_t subop, uint32_t flags,
+                                                   const char *node_name, const bn_attrib_array *attributes,
+                                                   uint32_t *out_node_id);
+// A set node: the binding is taken over.
+lc_status bn_set_request_msg_append_binding_takeover(bn_request_msg *msg, uint32_t subop, uint32_t flags,
+                                                     bn_binding **inout_binding, uint32_t *out_node_id);
+lc_status bn_query_request_msg_set_option_cond_db_revision_id(bn_request_msg *msg, uint32_t revision);
+lc_status bn_query_request_msg_get_option_cond_db_revision_id(const bn_request_msg *msg,
+                                                              uint32_t *out_revision);
+// `node_id` is not looked at: the node takes the message's next one.
+lc_status bn_action_request_msg_append_new_binding(bn_request_msg *msg, uint32_t node_id, const char *name,
+                                                   uint32_t type, const char *text, uint32_t *out_node_id);
+lc_status bn_event_request_msg_append_new_binding(bn_request_msg *msg, uint32_t node_id, const char *name,
+                                                  uint32_t type, const char *text, uint32_t *out_node_id);
+lc_status bn_action_request_msg_append_binding_takeover(bn_request_msg *msg, uint32_t node_id,
+                                                        bn_binding **inout_binding, uint32_t *out_node_id);
+lc_status bn_event_request_msg_append_binding_takeover(bn_request_msg *msg, uint32_t node_id,
+                                                       bn_binding **inout_binding, uint32_t *out_node_id);
+lc_status bn_action_request_msg_get_action_name(const bn_request_msg *msg, tstring **out);
+lc_status bn_event_request_msg_get_event_name(const bn_request_msg *msg, tstring **out);
+lc_status bn_request_set_transaction_id(bn_request_msg *msg, uint32_t transaction_id);
+lc_status bn_request_msg_free(bn_request_msg **inout);
+
+// Building responses. The return message is copied.
+lc_status bn_response_msg_create(bn_response_msg **out, uint16_t type, uint32_t response_to,
+                                 uint32_t return_code, const char *message);
+lc_status bn_query_response_msg_create(bn_response_msg **out, uint32_t response_to, uint32_t return_code,
+                                       const char *message);
+lc_status bn_action_response_msg_create(bn_response_msg **out, uint32_t response_to, uint32_t return_code,
+                                        const char *message);
+lc_status bn_response_msg_append_binding_takeover(bn_response_msg *msg, bn_binding **inout_binding,
+                                                  uint32_t node_id);
+lc_status bn_query_response_msg_append_binding_takeover(bn_response_msg *msg, bn_binding **inout_binding,
+                                                        uint32_t node_id);
+lc_status bn_response_msg_dup(const bn_response_msg *msg, bn_response_msg **out);
+lc_status bn_response_msg_free(bn_response_msg **inout);
+
+// Reading. Outs may be null; what they get is the caller's.
+int32_t bn_request_get_msg_id(const bn_request_msg *msg); // -1 for null
+lc_status bn_request_get(const bn_request_msg *msg, uint16_t *out_type, const void **out_body, int keep_parts,
+                         bn_binding_array **out_bindings, uint32_array **out_node_ids,
+                         bn_node_info **out_node_info); // node info: an array, freed with free()
+lc_status bn_response_get_msg_ids(const bn_response_msg *msg, uint32_t *out_response_to,
+                                  uint32_t *out_msg_id);
+lc_status bn_response_get_takeover(bn_response_msg *msg, uint32_t *out_code, tstring **out_message,
+                                   int keep_parts, bn_binding_array **out_bindings,
+                                   uint32_array **out_node_ids);
+lc_status bn_response_get(const bn_response_msg *msg, uint32_t *out_code, tstring **out_message,
+                          int keep_parts, bn_binding_array **out_bindings, uint32_array **out_node_ids);
+lc_status bn_query_response_msg_get_db_revision_id(const bn_response_msg *msg, uint32_t *out_revision);
+
+// Sending. A request to a session that is not connected vanishes with result 0.
+lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg);
+lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg);
+lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, tbuffer **out);
+lc_status bn_response_msg_serialize(bn_response_msg *msg, uint32_t header_bytes, tbuffer **out);
+lc_status bn_request_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_request_msg **out);
+lc_status bn_response_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_response_msg **out);
+void bn_request_msg_dump(gcl_session *session, const bn_request_msg *msg, int32_t level, const char *title);
+void bn_response_msg_dump(gcl_session *session, const bn_response_msg *msg, int32_t level, const char *title);
+
+// Callbacks. A session takes a copy of the instance's when it is made.
+using bn_request_callback = lc_status (*)(gcl_session *session, bn_request_msg *msg, void *data);
+using bn_response_callback = lc_status (*)(gcl_session *session, bn_response_msg *msg, void *data);
+#define BN_CALLBACK_SETTERS(kind, type)                                                                      \
+    lc_status bn_set_global_callback_##kind##_msg(gcl *instance, type callback, void *data);                 \
+    lc_status bn_set_session_callback_##kind##_msg(gcl_session *session, type callback, void *data);
+BN_CALLBACK_SETTERS(query_request, bn_request_callback)
+BN_CALLBACK_SETTERS(query_response, bn_response_callback)
+BN_CALLBACK_SETTERS(set_request, bn_request_callback)
+BN_CALLBACK_SETTERS(set_response, bn_response_callback)
+BN_CALLBACK_SETTERS(action_request, bn_request_callback)
+BN_CALLBACK_SETTERS(action_response, bn_response_callback)
+BN_CALLBACK_SETTERS(event_request, bn_request_callback)
+BN_CALLBACK_SETTERS(event_response, bn_response_callback)
+#undef BN_CALLBACK_SETTERS
+
+// Owners for a scope.
+inline void bn_free_request(bn_request_msg *msg) {
+    (void)bn_request_msg_free(&msg);
+}
+inline void bn_free_response(bn_response_msg *msg) {
+    (void)bn_response_msg_free(&msg);
+}
