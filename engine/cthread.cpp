@@ -1,0 +1,184 @@
+// Named threads.
+//
+// A context belongs to whoever made it until cthread_join frees it. While its thread may still have to be
+// ended it stands on the process's thread list, which has a mutex of its own; that mutex is a leaf, and is
+// not held while a thread is waited for.
+//
+// Signals: every thread made here is born with all signals blocked, so a signal to the process always goes to
+// the main thread and no sleep or wait of the engine is cut short by one.
+//
+// Stacks: all memory of the process is locked, so a stack costs what it reserves. 128 KiB hold a packet of
+// 4 KiB, the buffers of a log line and the deepest path of the engine several times over.
+//
+// Ending: cancel first, join afterwards, in two steps, so that a caller can cancel under a lock for which the
+// threads may be waiting, let go of the lock, and only then wait for their end. All threads are cancelled
+// before the first one is waited for: the end of many takes no longer than the end of the slowest.
+
+#include "engine/cthread.h"
+
+#include <sched.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <time.h>
+
+#include <cstdlib>
+
+#include "engine/wccp_mgr.h"
+#include "runtime/common.h"
+#include "runtime/guards.h"
+#include "runtime/logging.h"
+
+#ifdef WCCP_SANITIZED
+static constexpr size_t STACK_BYTES = 512 * 1024;
+#else
+static constexpr size_t STACK_BYTES = 128 * 1024;
+#endif
+static constexpr uint32_t CPU_LIMIT = 128;
+
+static pthread_mutex_t thread_list_mutex = PTHREAD_MUTEX_INITIALIZER;
+static cthread *thread_list;
+
+static void *no_start_fn(void *) {
+    pthread_exit(nullptr);
+}
+
+static void *no_end_fn(void *) {
+    pthread_exit(reinterpret_cast<void *>(intptr_t{-1}));
+}
+
+static uint64_t milliseconds_since_boot() {
+    timespec now = {};
+    clock_gettime(CLOCK_BOOTTIME, &now);
+    return static_cast<uint64_t>(now.tv_sec) * 1000 + static_cast<uint64_t>(now.tv_nsec) / 1000000;
+}
+
+static void *thread_main(void *argument) {
+    auto *context = static_cast<cthread *>(argument);
+    char kernel_name[16];
+    strlcpy(kernel_name, context->name, sizeof kernel_name);
+    pthread_setname_np(pthread_self(), kernel_name);
+
+    if (context->policy == SCHED_OTHER && setpriority(PRIO_PROCESS, 0, context->priority) != 0)
+        QV_LOG(LC_LOG_ERR, "%s: can't set priority for thread %s\n", __func__, context->name);
+    cpu_set_t cpus;
+    CPU_ZERO(&cpus);
+    if (context->cpu < CPU_LIMIT)
+        CPU_SET(context->cpu, &cpus);
+    if (sched_setaffinity(0, sizeof cpus, &cpus) != 0)
+        QV_LOG(LC_LOG_ERR, "%s: can't set affinity for thread %s\n", __func__, context->name);
+
+    context->start_fn(context->start_arg);
+    return context->end_fn(context->end_arg);
+}
+
+cthread *cthread_init(const char *name, void *(*start_fn)(void *), void *start_arg, void *(*end_fn)(void *),
+                      void *end_arg, uint32_t policy, int32_t priority, uint32_t cpu, uint32_t max_wait) {
+    auto *context = static_cast<cthread *>(calloc(1, sizeof(cthread)));
+    if (!context) {
+        QV_LOG(LC_LOG_ERR, "%s: allocation error\n", __func__);
+        return nullptr;
+    }
+    strlcpy(context->name, name ? name : "", sizeof context->name);
+    context->start_fn = start_fn ? start_fn : no_start_fn;
+    context->start_arg = start_arg;
+    context->end_fn = end_fn ? end_fn : no_end_fn;
+    context->end_arg = end_arg;
+    context->policy = policy;
+    context->priority = priority;
+    context->cpu = cpu;
+    context->max_wait = max_wait;
+    return context;
+}
+
+static int build_attributes(pthread_attr_t *attributes, const cthread *context) {
+    if (pthread_attr_init(attributes) != 0)
+        return 1;
+    const int policy = static_cast<int>(context->policy);
+    sched_param parameters = {};
+    parameters.sched_priority = policy == SCHED_OTHER ? 0 : context->priority;
+    if (pthread_attr_setstacksize(attributes, STACK_BYTES) == 0 &&
+        pthread_attr_setinheritsched(attributes, PTHREAD_EXPLICIT_SCHED) == 0 &&
+        pthread_attr_setschedpolicy(attributes, policy) == 0 &&
+        pthread_attr_setschedparam(attributes, &parameters) == 0)
+        return 0;
+    pthread_attr_destroy(attributes);
+    return 1;
+}
+
+int cthread_start(cthread *context) {
+    if (!context || build_attributes(&context->attributes, context))
+        return 1;
+    sigset_t all, previous;
+    sigfillset(&all);
+    pthread_sigmask(SIG_SETMASK, &all, &previous);
+    const int error = pthread_create(&context->thread, &context->attributes, thread_main, context);
+    pthread_sigmask(SIG_SETMASK, &previous, nullptr);
+    if (error != 0) {
+        pthread_attr_destroy(&context->attributes);
+        return 1;
+    }
+    context->heartbeat = milliseconds_since_boot();
+    const mutex_guard guard(&thread_list_mutex);
+    list_push_head(&thread_list, context);
+    context->listed = 1;
+    return 0;
+}
+
+// thread_list_mutex held.
+static void unlist(cthread *context) {
+    if (!context->listed)
+        return;
+    list_unlink(context);
+    context->listed = 0;
+}
+
+// thread_list_mutex held.
+static void unlist_and_cancel(cthread *context) {
+    unlist(context);
+    const int error = pthread_cancel(context->thread);
+    if (error != 0)
+        QV_LOG(LC_LOG_ERR, "%s: failed to cancel %s with error %d\n", "cthread_cancel", context->name, error);
+}
+
+void cthread_cancel(cthread *context) {
+    if (!context || context->heartbeat == 0)
+        return;
+    const mutex_guard guard(&thread_list_mutex);
+    unlist_and_cancel(context);
+}
+
+void cthread_join(cthread *context) {
+    if (!context)
+        return;
+    if (context->heartbeat != 0) { // 0: never started
+        {
+            const mutex_guard guard(&thread_list_mutex);
+            unlist(context);
+        }
+        pthread_join(context->thread, nullptr);
+        pthread_attr_destroy(&context->attributes);
+    }
+    free(context);
+}
+
+cthread *cthread_cancel_listed() {
+    const mutex_guard guard(&thread_list_mutex);
+    cthread *chain = nullptr;
+    while (cthread *context = thread_list) {
+        unlist_and_cancel(context);
+        context->next = chain;
+        chain = context;
+    }
+    return chain;
+}
+
+void cthread_join_chain(cthread *chain) {
+    while (cthread *context = chain) {
+        chain = context->next;
+        cthread_join(context);
+    }
+}
+
+void cthread_cancel_all() {
+    cthread_join_chain(cthread_cancel_listed());
+}

@@ -1,0 +1,202 @@
+// The engine's one global record, its start and stop, and the bodies of its threads.
+//
+// Threads. "WCCP_TIMER" sleeps a second and runs a tick; it isn't made in bridge mode. One "WCCP_RX_..." for
+// each interface that ever had an address waits for a datagram without any lock and hands it over under the
+// engine lock. Both are ended by cancellation only, in a sleep, a wait, or right after they got the engine
+// lock (wccp_utils.cpp); whatever they hold there sits in guards, so that no lock goes along with them.
+//
+// Bridge mode. The stop of the groups and the cancellation of the threads are one step under the engine lock;
+// the lock is released before the threads are waited for, because any of them may be waiting for that very
+// lock. A thread that is woken by the release finds itself cancelled. Nothing here starts the threads again.
+//
+// Exit. The groups go first, each with its farewell, then the threads. Notifications that come during the
+// exit are turned away at the door (wccp_link_mgr.cpp), so nobody makes a thread after they have been ended.
+//
+// The platform's notifier thread lives on until the process is gone. What its callbacks can reach, wccp_g
+// above all, is plain memory without a destructor.
+//
+// wccp_g.track_primary stays 0: nothing of this appliance ties the groups to the primary interface, which is
+// a table entry like the others.
+
+#include "engine/wccp_mgr.h"
+
+#include <errno.h>
+#include <time.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+#include <type_traits>
+
+#include "engine/cthread.h"
+#include "engine/wccp_config.h"
+#include "engine/wccp_host.h"
+#include "engine/wccp_link_mgr.h"
+#include "engine/wccp_network.h"
+#include "engine/wccp_pkt_mgr.h"
+#include "engine/wccp_state.h"
+#include "engine/wccp_tunnel.h"
+#include "engine/wccp_utils.h"
+#include "engine/wccpd_common.h"
+#include "platform/qvcommon.h"
+#include "runtime/logging.h"
+
+static constexpr uint8_t DEFAULT_MCAST_TTL = 5;
+
+// All zero, which is also the state of an unlocked mutex.
+constinit wccp_global wccp_g = {};
+static_assert(std::is_trivially_destructible_v<wccp_global>);
+
+static int start_timer_thread() {
+    cthread *timer = cthread_init("WCCP_TIMER", wccp_timer_thread_fn, nullptr, nullptr, nullptr, 0, 0, 0, 0);
+    if (timer && cthread_start(timer) == 0)
+        return 0;
+    cthread_join(timer);
+    QV_LOG(LC_LOG_ERR, "WCCP: Failed to spawn timer thread");
+    return 1;
+}
+
+int wccp_init_mgr() {
+    QV_LOG(LC_LOG_INFO, "WCCP: Initialize WCCP manager");
+    new (&wccp_g) wccp_global{};
+    pthread_mutex_init(&wccp_g.lock, nullptr);
+    wccp_g.mcast_ttl = DEFAULT_MCAST_TTL;
+
+    wccp_init_network();
+    if (wccp_is_system_in_bridge_mode()) {
+        QV_LOG(LC_LOG_NOTICE, "WCCP timer/rx threads are not launched in non Router mode");
+    } else if (start_timer_thread()) {
+        QV_LOG(LC_LOG_ERR, "WCCP: Cannot spawn threads");
+        return 1;
+    }
+    if (wccp_init_shmem()) {
+        QV_LOG(LC_LOG_ERR, "WCCP: Cannot init shared memory");
+        return 1;
+    }
+    if (wccp_init_link_mgr())
+        QV_LOG(LC_LOG_ERR, "WCCP: Cannot init link manager");
+    else
+        QV_LOG(LC_LOG_INFO, "WCCP: Done init link manager");
+    return 0;
+}
+
+int wccp_exit_mgr() {
+    QV_LOG(LC_LOG_NOTICE, "WCCP: wccp manager is exiting");
+    wccp_del_all_groups();
+    cthread_cancel_all();
+    wccp_deinit_link_mgr();
+    wccp_del_all_tunnels();
+    return 0;
+}
+
+wccp_service_group *wccp_find_group(int id) {
+    return wccp_g.groups[id & 0xff];
+}
+
+int wccp_config_mcast(wccp_interface *interface) {
+    for (wccp_service_group *group = interface->groups; group; group = group->if_next)
+        if (group->mcast_configured)
+            wccp_join_mc_grp(interface, group->mcast_ipa);
+    return 0;
+}
+
+int wccp_system_mode_change_event(const char *mode) {
+    if (!mode)
+        return 1;
+    if (strcmp(mode, "router") == 0 || strcmp(mode, "server") == 0)
+        return 0;
+    if (strcmp(mode, "bridge") != 0) {
+        QV_LOG(LC_LOG_WARNING, "WCCP cannot recognize new system mode: %s", mode);
+        return 1;
+    }
+    cthread *ended;
+    {
+        const wccp_engine_lock lock;
+        wccp_stop_all_service_groups();
+        ended = cthread_cancel_listed();
+    }
+    cthread_join_chain(ended);
+    return 0;
+}
+
+int wccp_init_network() {
+    if (g_qvif_skfd < 0)
+        qvif_network_init_sockets();
+    return 0;
+}
+
+void *wccp_rx_thread_fn(void *argument) {
+    auto *interface = static_cast<wccp_interface *>(argument);
+    if (!interface) {
+        QV_LOG(LC_LOG_ERR, "WCCP: net init: launching RX thread failed. (bad interface)");
+        return nullptr;
+    }
+    QV_LOG(LC_LOG_INFO, "WCCP: %s: receive thread is running", interface->name);
+    for (;;) {
+        wccp_pkt pkt = {};
+        pkt.cursor = pkt.data;
+        const int32_t received = wccp_rx_pkt(interface, &pkt, sizeof pkt.data);
+        if (received < 1)
+            continue;
+        pkt.length = static_cast<uint32_t>(received);
+        const wccp_engine_lock lock;
+        wccp_process_received_packet(&pkt);
+    }
+}
+
+void wccp_tick() {
+    if (wccpd_shutdown_in_progress() == 1)
+        return;
+    const wccp_engine_lock lock;
+    if (wccpd_shutdown_in_progress() == 1) // begun while this thread waited
+        return;
+    wccp_g.seconds++;
+    for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
+        if (group->admin_state == WCCP_ADMIN_UP)
+            wccp_process_timers(group);
+}
+
+void *wccp_timer_thread_fn(void *) {
+    for (;;) {
+        timespec left = {.tv_sec = 1, .tv_nsec = 0};
+        while (clock_nanosleep(CLOCK_MONOTONIC, 0, &left, &left) == EINTR) {
+        }
+        wccp_tick();
+    }
+}
+
+static void *counted_calloc(const char *function, uint32_t count, uint32_t size) {
+    void *memory = calloc(count, size);
+    if (memory) {
+        wccp_g.stat_allocs.fetch_add(1, std::memory_order_relaxed);
+        return memory;
+    }
+    wccp_g.stat_alloc_fails.fetch_add(1, std::memory_order_relaxed);
+    QV_LOG(LC_LOG_ERR, "WCCP %s: memory allocation failed. size: %d bytes", function,
+           static_cast<int>(count * size));
+    return nullptr;
+}
+
+void *wccp_calloc(uint32_t count, uint32_t size) {
+    return counted_calloc("wccp_calloc", count, size);
+}
+
+void *wccp_malloc(uint32_t size) {
+    return counted_calloc("wccp_malloc", 1, size);
+}
+
+void wccp_free(void *memory) {
+    if (!memory)
+        return;
+    wccp_g.stat_frees.fetch_add(1, std::memory_order_relaxed);
+    free(memory);
+}
+
+void wccp_seconds_to_str(uint32_t seconds, char *buffer, uint32_t length) {
+    length &= 0xff;
+    if (!buffer || length < 32)
+        return;
+    snprintf(buffer, length, "%u:%u:%u:%u", seconds / 86400, seconds / 3600 % 24, seconds / 60 % 60,
+             seconds % 60);
+}

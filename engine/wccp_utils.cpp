@@ -1,0 +1,65 @@
+// Small things that the whole engine shares, and the engine lock.
+//
+// The engine lock is taken by the timer thread for a tick, by a receive thread for a packet, by the main
+// thread for each call of configuration and monitoring, and by the platform's notifier for a callback.
+// Waiting for a mutex is no cancellation point, so a receive thread that waits while the engine is being
+// stopped gets the lock afterwards, with its cancellation still to come. It would put new routers into groups
+// that have been stopped, and commands to tunneld behind them. So the first thing done under the lock is to
+// ask for that cancellation: the thread ends there, a guard lets go of the lock on the way, and nothing has
+// been touched. The main thread and the notifier are never cancelled and never notice.
+
+#include "engine/wccp_utils.h"
+
+#include <bit>
+#include <cstddef>
+#include <cstring>
+
+#include "runtime/guards.h"
+
+wccp_engine_lock::wccp_engine_lock() : held(false) {
+    // The object is not complete here: if the thread ends, this guard is what unwinds.
+    mutex_guard guard(&wccp_g.lock);
+    pthread_testcancel();
+    guard.held = nullptr;
+    held = true;
+}
+
+wccp_engine_lock::~wccp_engine_lock() {
+    release();
+}
+
+void wccp_engine_lock::release() {
+    if (!held)
+        return;
+    held = false;
+    pthread_mutex_unlock(&wccp_g.lock);
+}
+
+wccp_addr_text addr_text(be32 address) {
+    wccp_addr_text text;
+    get_addr_str(4, address, 0, text.s, sizeof text.s);
+    return text;
+}
+
+void wccp_clear_assignment_block(wccp_service_group *group) {
+    constexpr size_t begin = offsetof(wccp_service_group, dsg_appliance_count);
+    constexpr size_t end = offsetof(wccp_service_group, pending_acks) + sizeof(group->pending_acks);
+    memset(reinterpret_cast<uint8_t *>(group) + begin, 0, end - begin);
+}
+
+const char *wccp_method_name(uint32_t code) {
+    static constexpr const char *names[] = {"none", "gre", "L2", "gre or L2"};
+    return code < 4 ? names[code] : "INVALID";
+}
+
+const char *wccp_assign_method_name(uint32_t code) {
+    static constexpr const char *names[] = {"none", "hash", "mask", "hash or mask"};
+    return code < 4 ? names[code] : "INVALID";
+}
+
+uint32_t util_wccp_mask_get_bits_set(const wccp_mask *mask) {
+    if (!mask)
+        return 0;
+    return static_cast<uint32_t>(std::popcount(mask->src_ip) + std::popcount(mask->dst_ip) +
+                                 std::popcount(mask->src_port) + std::popcount(mask->dst_port));
+}
