@@ -1,0 +1,487 @@
+// Interfaces that come, go and change under the notifications: whatever happens, and in whatever order or
+// number it is told, the picture that a program has at the end is the kernel's.
+
+#include <arpa/inet.h>
+#include <dirent.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <net/if.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/ioctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <condition_variable>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <map>
+#include <mutex>
+#include <random>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/qvcommon.h"
+#include "platform/qvcommon_transport.h"
+
+using namespace std::chrono_literals;
+
+namespace {
+
+struct link_state {
+    uint32_t admin_up = 0, link_up = 0;
+    bool operator==(const link_state &) const = default;
+};
+
+std::string kernel_address(const std::string &name) {
+    ifreq request = {};
+    request.ifr_addr.sa_family = AF_INET;
+    strncpy(request.ifr_name, name.c_str(), IFNAMSIZ - 1);
+    if (ioctl(g_qvif_skfd, SIOCGIFADDR, &request) != 0)
+        return "";
+    sockaddr_in address;
+    memcpy(&address, &request.ifr_addr, sizeof address);
+    return inet_ntoa(address.sin_addr);
+}
+
+link_state kernel_state(const std::string &name) {
+    ifreq request = {};
+    strncpy(request.ifr_name, name.c_str(), IFNAMSIZ - 1);
+    if (ioctl(g_qvif_skfd, SIOCGIFFLAGS, &request) != 0)
+        return {};
+    return {(request.ifr_flags & IFF_UP) ? 1u : 0u, (request.ifr_flags & IFF_RUNNING) ? 1u : 0u};
+}
+
+// What a program knows that follows the notifications and reads an address when told to, as the engine does.
+struct picture {
+    std::mutex mutex;
+    std::condition_variable changed;
+    std::map<std::string, link_state> links;
+    std::map<std::string, std::string> addresses;
+    std::vector<std::string> told; // "name 1/1", "name address"
+    size_t stack = 0;
+    bool held = false;    // the callbacks wait
+    bool waiting = false; // one does
+};
+picture *seen; // never freed: the library's thread outlives everything
+
+void note(const std::string &text) {
+    pthread_attr_t attributes;
+    pthread_getattr_np(pthread_self(), &attributes);
+    pthread_attr_getstacksize(&attributes, &seen->stack);
+    pthread_attr_destroy(&attributes);
+    seen->told.push_back(text);
+    seen->changed.notify_all();
+}
+
+void wait_while_held(std::unique_lock<std::mutex> &lock) {
+    seen->waiting = seen->held;
+    seen->changed.notify_all();
+    seen->changed.wait(lock, [] { return !seen->held; });
+    seen->waiting = false;
+}
+
+void on_link(const void *argument) {
+    const auto *info = static_cast<const qv_if_state_info *>(argument);
+    std::unique_lock lock(seen->mutex);
+    wait_while_held(lock);
+    seen->links[info->name] = {info->admin_up, info->link_up};
+    note(std::string(info->name) + " " + std::to_string(info->admin_up) + "/" +
+         std::to_string(info->link_up));
+}
+
+void on_address(const void *argument) {
+    const std::string name = static_cast<const char *>(argument);
+    std::unique_lock lock(seen->mutex);
+    wait_while_held(lock);
+    seen->addresses[name] = kernel_address(name);
+    note(name + " address");
+}
+
+void start() {
+    if (seen)
+        return;
+    seen = new picture;
+    qvif_network_init_sockets();
+    EXPECT_NE(qv_start_netlink_monitor(QV_NOTIFY_LINK_STATE), 0) << "nobody has registered";
+    EXPECT_NE(qv_register_netlink_notifier(2, on_link), 0);
+    EXPECT_NE(qv_register_netlink_notifier(0, nullptr), 0);
+    ASSERT_EQ(qv_register_netlink_notifier(QV_NOTIFY_LINK_STATE, on_link), 0);
+    ASSERT_EQ(qv_start_netlink_monitor(QV_NOTIFY_LINK_STATE), 0);
+    ASSERT_EQ(qv_register_netlink_notifier(QV_NOTIFY_IPA_CHANGE, on_address), 0);
+    ASSERT_EQ(qv_start_netlink_monitor(QV_NOTIFY_IPA_CHANGE), 0);
+}
+
+template <typename Condition>
+bool soon(Condition condition) {
+    std::unique_lock lock(seen->mutex);
+    return seen->changed.wait_for(lock, 10s, condition);
+}
+
+testing::AssertionResult is_told(const std::string &name, link_state state, const std::string &address) {
+    if (soon([&] { return seen->links[name] == state && seen->addresses[name] == address; }))
+        return testing::AssertionSuccess();
+    std::unique_lock lock(seen->mutex);
+    return testing::AssertionFailure() << name << " is known as " << seen->links[name].admin_up << "/"
+                                       << seen->links[name].link_up << " '" << seen->addresses[name] << "'";
+}
+
+void shell(const std::string &command) {
+    ASSERT_EQ(system(command.c_str()), 0) << command;
+}
+
+void batch(const std::string &commands) {
+    FILE *ip = popen("ip -force -batch - >/dev/null 2>&1", "w");
+    ASSERT_TRUE(ip);
+    fputs(commands.c_str(), ip);
+    pclose(ip); // some of them may fail
+}
+
+std::set<std::string> kernel_names() {
+    std::set<std::string> names;
+    struct if_nameindex *all = if_nameindex();
+    for (struct if_nameindex *at = all; at && at->if_index; at++)
+        names.insert(at->if_name);
+    if_freenameindex(all);
+    return names;
+}
+
+std::string difference_to_the_kernel() { // seen->mutex held
+    std::set<std::string> names = kernel_names();
+    for (const auto &[name, state] : seen->links)
+        names.insert(name);
+    for (const auto &[name, address] : seen->addresses)
+        names.insert(name);
+    std::string difference;
+    for (const std::string &name : names)
+        if (!(seen->links[name] == kernel_state(name)) || seen->addresses[name] != kernel_address(name))
+            difference += " " + name;
+    return difference;
+}
+
+// Once nothing has been told for a while, everything that is there or was ever told is known as the kernel
+// has it.
+testing::AssertionResult picture_is_the_kernels() {
+    const auto give_up = std::chrono::steady_clock::now() + 10s;
+    std::unique_lock lock(seen->mutex);
+    std::string difference;
+    do {
+        while (seen->changed.wait_for(lock, 60ms) == std::cv_status::no_timeout &&
+               std::chrono::steady_clock::now() < give_up)
+            ;
+        difference = difference_to_the_kernel();
+    } while (!difference.empty() && std::chrono::steady_clock::now() < give_up);
+    if (difference.empty())
+        return testing::AssertionSuccess();
+    return testing::AssertionFailure() << "wrong:" << difference;
+}
+
+void hold() {
+    std::unique_lock lock(seen->mutex);
+    seen->held = true;
+}
+void let_go() {
+    std::unique_lock lock(seen->mutex);
+    seen->held = false;
+    seen->changed.notify_all();
+}
+
+struct Netlink : testing::Test {
+    void SetUp() override {
+        start();
+        shell("ip link add va type veth peer name vb && ip link set vb up && ip link set va up && "
+              "ip addr add 10.9.0.1/24 dev va");
+        ASSERT_TRUE(is_told("va", {1, 1}, "10.9.0.1"));
+    }
+    void TearDown() override {
+        let_go();
+        for (const std::string &name : kernel_names())
+            if (name != "lo")
+                batch("link del " + name + "\n");
+        EXPECT_TRUE(picture_is_the_kernels());
+    }
+};
+
+} // namespace
+
+static int transported;
+static int transport_result;
+extern "C" int qv_state_event_transport(uint32_t one, const char *group_id, uint32_t role,
+                                        const uint8_t *code, gcl_session *) {
+    EXPECT_EQ(one, 1u);
+    EXPECT_STREQ(group_id, "51");
+    EXPECT_EQ(role, 1u);
+    EXPECT_EQ(*code, 237);
+    transported++;
+    return transport_result;
+}
+
+TEST(Closed, StateEventsAreHandedOnToTheProgram) {
+    const uint8_t code = 237;
+    EXPECT_EQ(qv_state_event_send(1, "51", 1, &code, nullptr), 0);
+    EXPECT_EQ(transported, 1);
+    transport_result = 1;
+    EXPECT_EQ(qv_state_event_send(1, "51", 1, &code, nullptr), -1);
+    EXPECT_EQ(qv_state_event_send(1, "51", 1, &code, nullptr), -2) << "those that nobody took are counted";
+}
+
+TEST(Closed, AddressText) {
+    char buffer[46];
+    EXPECT_EQ(get_addr_str(4, to_be32(0xC0A80A01), 0, buffer, sizeof buffer), buffer);
+    EXPECT_STREQ(buffer, "192.168.10.1");
+    EXPECT_STREQ(get_addr_str(4, to_be32(0xFFFFFFFF), 0, buffer, 15), "") << "no room for the terminator";
+    EXPECT_STREQ(get_addr_str(6, to_be32(1), 0, buffer, sizeof buffer), "");
+}
+
+TEST(Closed, TheInterfaceSocketIsOpenedOnce) {
+    qvif_network_init_sockets();
+    const int fd = g_qvif_skfd;
+    ASSERT_GE(fd, 0);
+    qvif_network_init_sockets();
+    EXPECT_EQ(g_qvif_skfd, fd);
+    EXPECT_TRUE(kernel_state("lo") == (link_state{1, 1}));
+}
+
+TEST_F(Netlink, TheThreadIsSmallAndTakesNoSignal) {
+    EXPECT_TRUE(is_told("lo", {1, 1}, "127.0.0.1")) << "what is there at the start is told";
+    EXPECT_LE(seen->stack, 512u * 1024);
+    int found = 0;
+    DIR *tasks = opendir("/proc/self/task");
+    while (const dirent *task = readdir(tasks)) {
+        const std::string base = std::string("/proc/self/task/") + task->d_name;
+        std::string comm, line;
+        std::getline(std::ifstream(base + "/comm"), comm);
+        if (comm != "qv_netlink")
+            continue;
+        found++;
+        std::ifstream status(base + "/status");
+        while (std::getline(status, line)) {
+            if (line.rfind("SigBlk:", 0) != 0)
+                continue;
+            const uint64_t blocked = std::stoull(line.substr(7), nullptr, 16);
+            for (int number = 1; number <= 64; number++) {
+                if (number == SIGKILL || number == SIGSTOP || number == 32 || number == 33)
+                    continue; // not to be blocked, or the C library's own
+                EXPECT_TRUE(blocked >> (number - 1) & 1) << number;
+            }
+        }
+    }
+    closedir(tasks);
+    EXPECT_EQ(found, 1);
+}
+
+TEST_F(Netlink, LinkAndAddressFollowTheKernel) {
+    shell("ip link set vb down");
+    EXPECT_TRUE(is_told("va", {1, 0}, "10.9.0.1"));
+    shell("ip link set va down");
+    EXPECT_TRUE(is_told("va", {0, 0}, "10.9.0.1"));
+    shell("ip addr del 10.9.0.1/24 dev va");
+    EXPECT_TRUE(is_told("va", {0, 0}, ""));
+    shell("ip link set vb up && ip addr add 10.9.0.2/24 dev va && ip link set va up");
+    EXPECT_TRUE(is_told("va", {1, 1}, "10.9.0.2"));
+    shell("ip addr add 10.8.0.1/24 dev va && ip addr del 10.9.0.2/24 dev va");
+    EXPECT_TRUE(is_told("va", {1, 1}, "10.8.0.1"));
+}
+
+TEST_F(Netlink, ARenamedInterfaceIsDownUnderItsOldName) {
+    shell("ip link set va down && ip link set va name vc");
+    EXPECT_TRUE(is_told("va", {0, 0}, ""));
+    shell("ip link set vc up");
+    EXPECT_TRUE(is_told("vc", {1, 1}, "10.9.0.1"));
+    shell("ip link add va type veth peer name vd && ip link set vd up && ip link set va up && "
+          "ip addr add 10.7.0.1/24 dev va");
+    EXPECT_TRUE(is_told("va", {1, 1}, "10.7.0.1"));
+    shell(
+        "ip link set vc down && ip link set va down && ip link set vc name tmp && ip link set va name vc && "
+        "ip link set tmp name va && ip link set vc up && ip link set va up");
+    EXPECT_TRUE(is_told("va", {1, 1}, "10.9.0.1"));
+    EXPECT_TRUE(is_told("vc", {1, 1}, "10.7.0.1"));
+    EXPECT_TRUE(is_told("tmp", {0, 0}, ""));
+}
+
+TEST_F(Netlink, AnInterfaceMadeAgainIsToldAsDownFirst) {
+    for (int i = 0; i < 20; i++) {
+        {
+            std::unique_lock lock(seen->mutex);
+            seen->told.clear();
+        }
+        const std::string address = "10.9.1." + std::to_string(i + 1);
+        shell("ip link del va && ip link add va type veth peer name vb && ip link set vb up && ip link set "
+              "va up && "
+              "ip addr add " +
+              address + "/24 dev va");
+        ASSERT_TRUE(is_told("va", {1, 1}, address));
+        std::unique_lock lock(seen->mutex);
+        const auto down = std::find(seen->told.begin(), seen->told.end(), "va 0/0");
+        ASSERT_NE(down, seen->told.end());
+        EXPECT_NE(std::find(down, seen->told.end(), "va 1/1"), seen->told.end());
+    }
+}
+
+TEST_F(Netlink, AnInterfaceThatMovesToAnotherNamespaceIsDown) {
+    const pid_t other = fork();
+    if (other == 0) {
+        execlp("unshare", "unshare", "-n", "sleep", "60", nullptr);
+        _exit(127);
+    }
+    const std::string of_other = "/proc/" + std::to_string(other) + "/ns/net";
+    char mine[64] = "", theirs[64] = "";
+    ASSERT_GT(readlink("/proc/self/ns/net", mine, sizeof mine - 1), 0);
+    for (int i = 0; i < 1000; i++) {
+        theirs[0] = '\0';
+        if (readlink(of_other.c_str(), theirs, sizeof theirs - 1) > 0 && strcmp(mine, theirs) != 0)
+            break;
+        std::this_thread::sleep_for(5ms);
+    }
+    ASSERT_STRNE(mine, theirs);
+    shell("ip link set va netns " + std::to_string(other));
+    EXPECT_TRUE(is_told("va", {0, 0}, ""));
+    shell("nsenter --net=" + of_other + " ip link set va netns " + std::to_string(getpid()) +
+          " && ip addr add 10.9.0.3/24 dev va && ip link set va up");
+    EXPECT_TRUE(is_told("va", {1, 1}, "10.9.0.3"));
+    kill(other, SIGKILL);
+    waitpid(other, nullptr, 0);
+}
+
+TEST_F(Netlink, APortThatLeavesItsBridgeStaysUp) {
+    shell("ip link add bridge0 type bridge && ip link set bridge0 up && ip link set va master bridge0");
+    EXPECT_TRUE(is_told("bridge0", {1, 1}, ""));
+    {
+        std::unique_lock lock(seen->mutex);
+        seen->told.clear();
+    }
+    shell("ip link set va nomaster && ip link del bridge0");
+    EXPECT_TRUE(is_told("bridge0", {0, 0}, ""));
+    EXPECT_TRUE(picture_is_the_kernels());
+    std::unique_lock lock(seen->mutex);
+    EXPECT_EQ(std::find(seen->told.begin(), seen->told.end(), "va 0/0"), seen->told.end());
+}
+
+// A callback stands still while the kernel's queue runs over many times; among the notifications that are
+// lost are the ones that count.
+TEST_F(Netlink, AnOverrunEndsInTheRightState) {
+    for (const char *const lost : {
+             "ip link set vb up && ip addr flush dev va && ip addr add 10.6.0.1/24 dev va",
+             "ip link set va down && ip link set va name vc && ip link set vc up",
+             "ip link set va down && ip link set va name vc && ip link set vb name va && ip link set vc name "
+             "vb",
+             "ip link del va",
+             "ip link del va && ip link add va type veth peer name vb && ip link set vb up && ip link set va "
+             "up "
+             "&& "
+             "ip addr add 10.9.0.1/24 dev va",
+             "ip link set va down && ip link set vb up",
+         }) {
+        hold();
+        shell("ip link set vb down"); // one callback waits now
+        ASSERT_TRUE(soon([] { return seen->waiting; }));
+        ifreq request = {};
+        strcpy(request.ifr_name, "va");
+        ASSERT_EQ(ioctl(g_qvif_skfd, SIOCGIFFLAGS, &request), 0);
+        for (int i = 0; i < 3000; i++) {
+            request.ifr_flags = static_cast<short>(request.ifr_flags ^ IFF_UP);
+            ASSERT_EQ(ioctl(g_qvif_skfd, SIOCSIFFLAGS, &request), 0);
+        }
+        shell(lost);
+        {
+            std::unique_lock lock(seen->mutex);
+            seen->told.clear();
+        }
+        let_go();
+        ASSERT_TRUE(picture_is_the_kernels()) << lost;
+        {
+            std::unique_lock lock(seen->mutex);
+            EXPECT_LT(seen->told.size(), 2000u) << "the queue did not run over";
+            if (strstr(lost, "ip link add va")) {
+                EXPECT_NE(std::find(seen->told.begin(), seen->told.end(), "va 0/0"), seen->told.end())
+                    << "another interface under the old name";
+            }
+        }
+        TearDown();
+        SetUp();
+    }
+}
+
+TEST_F(Netlink, AnyOrderOfEverythingEndsInTheRightState) {
+    std::mt19937 random(7);
+    const auto pick = [&](const char *const(&words)[5]) { return std::string(words[random() % 5]); };
+    const char *const names[5] = {"va", "vb", "vc", "vd", "ve"};
+    for (int round = 0; round < 15; round++) {
+        std::string commands;
+        for (int i = 0; i < 300; i++) {
+            const std::string one = pick(names), other = pick(names);
+            const std::string address = "10." + std::to_string(random() % 4) + ".0.1/24";
+            switch (random() % 8) {
+            case 0:
+                commands += "link add " + one + " type veth peer name " + other + "\n";
+                break;
+            case 1:
+                commands += random() % 4 ? "" : "link del " + one + "\n";
+                break;
+            case 2:
+                commands += "link set " + one + " name " + other + "\n";
+                break;
+            case 3:
+                commands += "addr add " + address + " dev " + one + "\n";
+                break;
+            case 4:
+                commands += "addr del " + address + " dev " + one + "\n";
+                break;
+            case 5:
+                commands += "link set " + one + " down\n";
+                break;
+            default:
+                commands += "link set " + one + " up\n";
+            }
+        }
+        if (round % 3 == 0)
+            hold();
+        batch(commands);
+        let_go();
+        ASSERT_TRUE(picture_is_the_kernels()) << "round " << round;
+    }
+}
+
+// The library's thread is in the middle of its work while exit() takes the process down.
+TEST(Exit, DISABLED_Child) {
+    start();
+    static const char flip[] = "while :; do ip link set lo down; ip link set lo up; done";
+    const pid_t flipper = fork();
+    if (flipper == 0) {
+        execl("/bin/sh", "sh", "-c", flip, nullptr);
+        _exit(127);
+    }
+    std::this_thread::sleep_for(20ms);
+    ifreq request = {};
+    strcpy(request.ifr_name, "lo");
+    ioctl(g_qvif_skfd, SIOCGIFFLAGS, &request);
+    atexit([] { // the destructors' time, drawn out
+        std::this_thread::sleep_for(100ms);
+    });
+    for (int i = 0; i < 200; i++) {
+        request.ifr_flags = static_cast<short>(request.ifr_flags ^ IFF_UP);
+        ioctl(g_qvif_skfd, SIOCSIFFLAGS, &request);
+    }
+    kill(flipper, SIGKILL);
+    exit(0);
+}
+
+TEST(Exit, NothingThatTheThreadTouchesIsTornDown) {
+    for (int i = 0; i < 10; i++) {
+        const pid_t child = fork();
+        if (child == 0) {
+            execl("/proc/self/exe", "child", "--gtest_also_run_disabled_tests",
+                  "--gtest_filter=Exit.DISABLED_Child", "--gtest_brief=1", nullptr);
+            _exit(127);
+        }
+        int status = 0;
+        ASSERT_EQ(waitpid(child, &status, 0), child);
+        ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
+    }
+}
