@@ -1,0 +1,179 @@
+// The questions of the monitoring tree. Each entry point takes the engine lock, copies what was asked for
+// into the caller's record and lets go; nothing that it gives out points into the engine. What is not there
+// leaves the record as the caller made it.
+
+#include "engine/wccp_config.h"
+
+#include "engine/wccp_utils.h"
+#include "runtime/common.h"
+#include "runtime/logging.h"
+
+template <size_t Size>
+static void put_text(char (&field)[Size], const char *text) {
+    strlcpy(field, text, Size);
+}
+
+// Value to word; a value behind the table is "unknown".
+template <size_t Count>
+static const char *word_of(const char *const (&words)[Count], uint32_t value) {
+    return value < Count ? words[value] : "unknown";
+}
+
+// The place-th record of a list, counted from 1.
+template <typename T>
+static T *nth(T *head, uint32_t place) {
+    for (uint32_t i = 1; head; head = head->next, i++)
+        if (i == place)
+            return head;
+    return nullptr;
+}
+
+static wccp_service_group *find_group_or_tell(int id) {
+    wccp_service_group *group = wccp_find_group(id);
+    if (!group)
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: cannot find group", id);
+    return group;
+}
+
+int wccp_get_grp_list(wccp_grp_list *list) {
+    if (!list)
+        return 1;
+    const wccp_engine_lock lock;
+    list->count = 0;
+    for (uint32_t id = 0; id < WCCP_MAX_GROUPS; id++)
+        if (wccp_g.groups[id])
+            list->ids[list->count++] = static_cast<uint8_t>(id);
+    return 0;
+}
+
+int wccp_get_grp_info(int id, wccp_grp_info *info) {
+    // Indexed by the three state bits.
+    static constexpr const char *state_words[] = {"not-set", "INIT",    "ACTIVE", "unknown",
+                                                  "BACKUP",  "unknown", "uknown", "unknown"};
+    if (!info)
+        return 1;
+    const wccp_engine_lock lock;
+    const wccp_service_group *group = find_group_or_tell(id);
+    if (!group)
+        return 1;
+    info->appliance_ipa = group->appliance_ipa;
+    info->num_routers = group->sending_router_count;
+    info->num_appliances = group->appliance_view_count;
+    info->num_view_routers = group->router_view_count;
+    const bool timed = (group->state_flags & (WCCP_STATE_ACTIVE | WCCP_STATE_BACKUP)) != 0;
+    info->uptime = timed ? wccp_g.seconds - group->state_time : 0;
+    put_text(info->oper, state_words[group->state_flags & WCCP_STATE_MASK]);
+    if (group->designated == 1)
+        strlcat(info->oper, ", DESIGNATED", sizeof info->oper);
+    return 0;
+}
+
+int wccp_get_grp_router_info(int id, wccp_grp_router_info *info) {
+    static constexpr const char *method_words[] = {"not set", "GRE", "L2"};
+    static constexpr const char *assign_words[] = {"not set", "HASH", "MASK"};
+    if (!info)
+        return 1;
+    const wccp_engine_lock lock;
+    const wccp_service_group *group = find_group_or_tell(id);
+    if (!group)
+        return 1;
+    const wccp_sending_router *router = nth(group->sending_routers, info->router_num);
+    if (!router) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: Router number %d not present", id,
+               static_cast<int>(info->router_num));
+        return 0;
+    }
+    info->router_id = router->router_id;
+    info->src_ipa = router->src_ipa;
+    info->conn_time = wccp_g.seconds - router->state_time;
+    const bool agreed = (group->state_flags & WCCP_CAPABILITIES_SET) != 0;
+    put_text(info->fwd, agreed ? word_of(method_words, group->fwd_method) : "not-set");
+    put_text(info->ret, agreed ? word_of(method_words, group->ret_method) : "not-set");
+    put_text(info->assign, agreed ? word_of(assign_words, group->assign_method) : "not-set");
+    put_text(info->state, router->flags & WCCP_RTR_TWO_WAY   ? "TWO-WAY connected"
+                          : router->flags & WCCP_RTR_ONE_WAY ? "ONE-WAY connected"
+                                                             : "unknown");
+    return 0;
+}
+
+int wccp_get_grp_appliance_info(int id, wccp_grp_appliance_info *info) {
+    if (!info)
+        return 1;
+    const wccp_engine_lock lock;
+    const wccp_service_group *group = wccp_find_group(id);
+    if (!group)
+        return 0;
+    const wccp_view_appliance *appliance = nth(group->appliance_view, info->appliance_num);
+    if (!appliance) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance number %d not present", id,
+               static_cast<int>(info->appliance_num));
+        return 0;
+    }
+    info->ipa = appliance->ipa;
+    info->weight = appliance->weight;
+    return 0;
+}
+
+wccp_sending_router *wccp_find_router_instance(int id, uint32_t router_num) {
+    const wccp_service_group *group = wccp_find_group(id);
+    if (!group) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find router: cannot find group id %d", id, id);
+        return nullptr;
+    }
+    wccp_sending_router *router = nth(group->sending_routers, router_num);
+    if (!router)
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find router: router number %d not present", id,
+               static_cast<int>(router_num));
+    return router;
+}
+
+int wccp_get_router_list(wccp_router_list *list) {
+    if (!list)
+        return 1;
+    const wccp_engine_lock lock;
+    const wccp_service_group *group = find_group_or_tell(static_cast<int>(list->group_id));
+    if (!group)
+        return 1;
+    list->count = 0;
+    for (const wccp_sending_router *router = group->sending_routers; router && list->count < WCCP_MAX_ROUTERS;
+         router = router->next) {
+        list->router_nums[list->count] = list->count + 1;
+        list->count++;
+    }
+    return 0;
+}
+
+int wccp_get_router_appliance_list(wccp_router_appliance_list *list) {
+    if (!list)
+        return 1;
+    const wccp_engine_lock lock;
+    const wccp_sending_router *router =
+        wccp_find_router_instance(static_cast<int>(list->group_id), list->router_num);
+    if (!router)
+        return 1;
+    list->count = router->view_appliance_count;
+    for (uint32_t i = 0; i < list->count; i++)
+        list->ipa[i] = router->view_appliances[i].ipa;
+    return 0;
+}
+
+int wccp_get_router_appliance_info(wccp_router_appliance_info *info) {
+    if (!info)
+        return 1;
+    const wccp_engine_lock lock;
+    const int id = static_cast<int>(info->group_id);
+    const wccp_sending_router *router = wccp_find_router_instance(id, info->router_num);
+    if (!router)
+        return 1;
+    for (uint32_t i = 0; i < router->view_appliance_count; i++) {
+        const wccp_rtr_view_appliance *appliance = &router->view_appliances[i];
+        if (appliance->ipa != info->ipa)
+            continue;
+        info->load_percent =
+            appliance->buckets_total ? appliance->buckets_assigned * 100u / appliance->buckets_total : 0;
+        return 0;
+    }
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find appliance: appliance id %s not present in router %d", id,
+           addr_text(info->ipa).s, static_cast<int>(info->router_num));
+    return 1;
+}
