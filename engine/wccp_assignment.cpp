@@ -1,0 +1,287 @@
+// The designated appliance's table.
+//
+// The state machine collects the appliances that all routers report (start, add for each, finish), and finish
+// turns their weights into a table of slots, each naming one appliance: 256 hash buckets, or the values of
+// the mask. The table is a proportional split over the appliances in sorted order, so each has one run of
+// slots. The order is that of the C library's qsort over the address words as they lie in memory, compared by
+// their difference with wrap-around. Where that comparison runs in circles (three appliances more than half
+// the range apart) the order is whatever qsort makes of it, always the same for the same input.
+//
+// An appliance that has just dropped out, a down entry, keeps the place of its share for one computation:
+// only its run is split among the others, and no other slot moves. It leaves dsg_appliances right after, so
+// the next computation knows nothing of it. Between computations the entries are the active appliances in
+// order of their first arrival; bucket_index points into this order.
+//
+// All of it runs under the engine lock, on the tick or on a receive thread. The only memory taken is the work
+// arrays of a computation. Nothing here depends on a clock or on chance: the seed is always 0.
+//
+// dsg_appliances has 32 places, and a report that replaces many appliances at once may ask for more, since
+// down entries are still in it. Then down entries give way, the one with the fewest slots first; its slots
+// are shared out like any others and its neighbours' may move. At most 32 appliances are reported by all
+// routers, so the active ones always find room.
+#include "engine/wccp_assignment.h"
+
+#include <cassert>
+#include <cstdlib>
+#include <cstring>
+
+#include "engine/wccp_hash_assignment.h"
+#include "engine/wccp_mask_assignment.h"
+#include "engine/wccp_utils.h"
+#include "runtime/guards.h"
+
+static constexpr uint16_t FALLBACK_WEIGHT = 100;
+
+wccp_dsg_appliance *wccp_find_dsg_appliance(wccp_service_group *group, uint32_t count, be32 address) {
+    for (uint32_t i = 0; i < count; i++)
+        if (group->dsg_appliances[i].ipa == address)
+            return &group->dsg_appliances[i];
+    return nullptr;
+}
+
+void wccp_designated_appliance_assignment_start(wccp_service_group *group) {
+    group->bucket_count = 0;
+    for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
+        group->dsg_appliances[i].up = 0;
+}
+
+// Takes the down entry with the fewest slots out, the later one of equals. False when no entry is down.
+static bool make_room(wccp_service_group *group) {
+    wccp_dsg_appliance *const entries = group->dsg_appliances;
+    uint32_t least = WCCP_MAX_APPLIANCES;
+    for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
+        if (!entries[i].up &&
+            (least == WCCP_MAX_APPLIANCES || entries[i].assigned <= entries[least].assigned))
+            least = i;
+    if (least == WCCP_MAX_APPLIANCES)
+        return false;
+    group->dsg_appliance_count--;
+    memmove(&entries[least], &entries[least + 1],
+            (group->dsg_appliance_count - least) * sizeof(wccp_dsg_appliance));
+    return true;
+}
+
+void wccp_designated_appliance_assignment_add(wccp_service_group *group,
+                                              const wccp_view_appliance *appliance) {
+    if (wccp_dsg_appliance *entry =
+            wccp_find_dsg_appliance(group, group->dsg_appliance_count, appliance->ipa)) {
+        entry->up = 1;
+        entry->weight = appliance->weight;
+        return;
+    }
+    if (group->dsg_appliance_count >= WCCP_MAX_APPLIANCES && !make_room(group)) {
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) is one too many.",
+               group->id, addr_text(appliance->ipa).s, appliance->weight);
+        return;
+    }
+    group->dsg_appliances[group->dsg_appliance_count++] = {
+        .ipa = appliance->ipa, .up = 1, .weight = appliance->weight, .assigned = 0};
+}
+
+// The number of slots that the agreed method has, 0 when none is agreed.
+static uint32_t slots_of_method(wccp_service_group *group) {
+    switch (group->assign_method) {
+    case WCCP_ASSIGN_HASH:
+        return WCCP_MAX_BUCKETS;
+    case WCCP_ASSIGN_MASK:
+        wccp_mask_assignment_calculate_value_table(group);
+        return group->mask_value_count;
+    default:
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d: calculate assignment buckets: assignment method (%d) is not set (yet)",
+               group->id, static_cast<int>(group->assign_method));
+        return 0;
+    }
+}
+
+static void compute_table(wccp_service_group *group) {
+    wccp_dsg_appliance entries[WCCP_MAX_APPLIANCES]; // sorted, while dsg_appliances keeps its order
+    memcpy(entries, group->dsg_appliances, group->dsg_appliance_count * sizeof entries[0]);
+    for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
+        group->dsg_active_count += entries[i].up == 1;
+    if (group->dsg_active_count == 0) {
+        QV_LOG(LC_LOG_ERR,
+               "WCCP GRP %d: DSG event: cannot find any appliances to redirect traffic to. #of apps: %d, "
+               "#of active apps: %d",
+               group->id, static_cast<int>(group->dsg_appliance_count),
+               static_cast<int>(group->dsg_active_count));
+        return;
+    }
+    group->bucket_count = slots_of_method(group);
+    if (group->bucket_count != 0)
+        wccp_compute_assignment_table(group->dsg_appliance_count, entries, group->bucket_count,
+                                      group->bucket_ipa, 0);
+}
+
+// Moves the active entries forward, in their order, and zeroes what is left behind them.
+static uint32_t close_gaps(wccp_service_group *group) {
+    uint32_t kept = 0;
+    for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
+        if (group->dsg_appliances[i].up == 1)
+            group->dsg_appliances[kept++] = group->dsg_appliances[i];
+    for (uint32_t i = kept; i < group->dsg_appliance_count; i++)
+        group->dsg_appliances[i] = {};
+    return kept;
+}
+
+void wccp_designated_appliance_assignment_finish(wccp_service_group *group) {
+    group->bucket_count = 0;
+    group->dsg_active_count = 0;
+    compute_table(group);
+    const uint32_t kept = close_gaps(group);
+    if (kept == 0) {
+        wccp_designated_appliance_assignment_cleanup(group);
+        return;
+    }
+    group->dsg_appliance_count = kept;
+    group->dsg_active_count = kept;
+    if (group->assign_method == WCCP_ASSIGN_HASH)
+        wccp_hash_assignment_assign_hash_buckets(group);
+    else if (group->assign_method == WCCP_ASSIGN_MASK)
+        (void)wccp_mask_assignment_assign_mask_values(group);
+}
+
+void wccp_designated_appliance_assignment_cleanup(wccp_service_group *group) {
+    memset(group->bucket_ipa, 0, sizeof group->bucket_ipa);
+    memset(group->bucket_index, 0, sizeof group->bucket_index);
+    for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
+        group->dsg_appliances[i] = {};
+    group->bucket_count = 0;
+    group->dsg_appliance_count = 0;
+    group->dsg_active_count = 0;
+}
+
+// The computation.
+
+namespace {
+
+void free_words(be32 *words) {
+    wccp_free(words);
+}
+void free_weights(uint16_t *weights) {
+    wccp_free(weights);
+}
+void free_numbers(uint32_t *numbers) {
+    wccp_free(numbers);
+}
+using owned_words = owned<be32, free_words>;
+using owned_weights = owned<uint16_t, free_weights>;
+using owned_numbers = owned<uint32_t, free_numbers>;
+
+template <typename T>
+T *work_array(uint32_t count) {
+    return static_cast<T *>(wccp_calloc(count, sizeof(T)));
+}
+
+int compare_address_words(const void *first, const void *second) {
+    be32 a, b;
+    memcpy(&a, first, sizeof a);
+    memcpy(&b, second, sizeof b);
+    return static_cast<int>(raw_word(a) - raw_word(b));
+}
+static_assert(offsetof(wccp_dsg_appliance, ipa) == 0);
+
+// The slots that a down entry holds are one run of the table.
+struct slot_run {
+    uint32_t begin, length;
+};
+slot_run find_run(const be32 *table, uint32_t slots, be32 address) {
+    slot_run run = {0, 0};
+    while (run.begin < slots && !(table[run.begin] == address))
+        run.begin++;
+    while (run.begin + run.length < slots && table[run.begin + run.length] == address)
+        run.length++;
+    return run;
+}
+
+} // namespace
+
+void wccp_compute_assignment_table(uint32_t count, wccp_dsg_appliance *entries, uint32_t slots, be32 *table,
+                                   uint32_t seed) {
+    if (count == 0)
+        return;
+    const owned_words all(work_array<be32>(count));
+    const owned_weights all_weights(work_array<uint16_t>(count));
+    const owned_words active(work_array<be32>(count));
+    const owned_weights active_weights(work_array<uint16_t>(count));
+    if (!all.pointer || !all_weights.pointer || !active.pointer || !active_weights.pointer) {
+        QV_LOG(LC_LOG_ERR, "Computing assignment table failed: out of memory");
+        return;
+    }
+    qsort(entries, count, sizeof *entries, compare_address_words);
+    uint32_t active_count = 0, active_weight = 0;
+    be32 fallback = {};
+    for (uint32_t i = 0; i < count; i++) {
+        const wccp_dsg_appliance *entry = &entries[i];
+        all.pointer[i] = entry->ipa;
+        all_weights.pointer[i] = entry->weight;
+        if (!entry->up)
+            continue;
+        active.pointer[active_count] = entry->ipa;
+        active_weights.pointer[active_count++] = entry->weight;
+        active_weight += entry->weight;
+        if (entry->weight == 0 && raw_word(entry->ipa) > raw_word(fallback))
+            fallback = entry->ipa;
+    }
+    if (active_count == 0)
+        return;
+    if (active_weight == 0) {
+        compute_u8_assignment_array(1, &fallback, &FALLBACK_WEIGHT, slots, table);
+    } else {
+        compute_u8_assignment_array(count, all.pointer, all_weights.pointer, slots, table);
+        for (uint32_t i = 0; i < count; i++) {
+            if (entries[i].up)
+                continue;
+            const slot_run run = find_run(table, slots, entries[i].ipa);
+            compute_u8_assignment_array(active_count, active.pointer, active_weights.pointer, run.length,
+                                        table + run.begin);
+        }
+    }
+    if (seed != 0)
+        scramble_u8_array(slots, table, seed);
+}
+
+void compute_u8_assignment_array(uint32_t count, const be32 *identifiers, const uint16_t *weights,
+                                 uint32_t slots, be32 *table) {
+    if (count == 0)
+        return;
+    const owned_numbers shares(work_array<uint32_t>(count));
+    if (!shares.pointer) {
+        QV_LOG(LC_LOG_ERR, "WCCP assignment array calculation failed: out of memory");
+        return;
+    }
+    uint32_t total_weight = 0;
+    for (uint32_t i = 0; i < count; i++)
+        total_weight += weights[i];
+    if (total_weight == 0)
+        return;
+    const uint32_t num_buckets = slots;
+    uint32_t running = 0, k = 0;
+    for (uint32_t i = 0; i < count; i++) {
+        running += weights[i] * slots;
+        const uint32_t quotient = running / total_weight;
+        shares.pointer[i] = quotient - k;
+        k = quotient;
+    }
+    // clang-format off
+    assert(k==num_buckets);
+    k = 0;
+    for (uint32_t i = 0; i < count; i++)
+        for (uint32_t left = shares.pointer[i]; left != 0; left--)
+            table[k++] = identifiers[i];
+    assert(k==num_buckets);
+    // clang-format on
+    (void)num_buckets;
+}
+
+void scramble_u8_array(uint32_t slots, be32 *table, uint32_t seed) {
+    unsigned state = seed;
+    for (uint32_t i = slots; i-- > 0;) {
+        const uint64_t r = static_cast<uint64_t>(rand_r(&state));
+        const uint64_t j = (r * i) >> 31;
+        const be32 moved = table[i];
+        table[i] = from_raw_word(raw_word(table[j]) & 0xff);
+        table[j] = moved;
+    }
+}

@@ -1,0 +1,110 @@
+// Mask assignment: the values that the group's mask spans, and which appliance serves each.
+//
+// A router ANDs fields of a packet with the mask and looks the result up among the values. Each bit that is
+// set in the mask is noted alone, in one fixed order over the fields, and value k is the sum of those bits
+// whose number is set in k; so 7 bits give 128 values, and a mask of 0 gives the one value 0. A mask with
+// more bits than that isn't used: four bits of the destination address stand in for it, in the assignment
+// only; what the group is configured with, and what a Here-I-Am tells, stays.
+//
+// Runs inside a computation of the table, under the engine lock: the values first, which then count as slots,
+// and their owners at the end. Masks and values are in host order.
+#include "engine/wccp_mask_assignment.h"
+
+#include <cstring>
+
+#include "engine/wccp_assignment.h"
+#include "engine/wccp_utils.h"
+
+static constexpr uint32_t DEFAULT_DST_IP_MASK = 0xF00;
+
+static void wccp_mask_assignment_set_bit_array_element(wccp_service_group *group, const wccp_mask &bit) {
+    if (group->mask_bit_count >= WCCP_MAX_MASK_BITS) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: mask assignment: bit array: is full (%d)", group->id,
+               static_cast<int>(group->mask_bit_count));
+        return;
+    }
+    group->mask_bit_array[group->mask_bit_count++] = bit;
+}
+
+static void build_bit_array(wccp_service_group *group) {
+    enum { DST_PORT, SRC_PORT, DST_IP, SRC_IP, FIELDS }; // the order in which bits are taken
+    const wccp_mask &mask = group->mask_in_use;
+    const uint32_t fields[FIELDS] = {mask.dst_port, mask.src_port, mask.dst_ip, mask.src_ip};
+    for (uint32_t field = 0; field < FIELDS; field++) {
+        for (uint32_t left = fields[field]; left != 0; left &= left - 1) {
+            uint32_t alone[FIELDS] = {};
+            alone[field] = left & (~left + 1);
+            wccp_mask_assignment_set_bit_array_element(group,
+                                                       {
+                                                           .src_ip = alone[SRC_IP],
+                                                           .dst_ip = alone[DST_IP],
+                                                           .src_port = static_cast<uint16_t>(alone[SRC_PORT]),
+                                                           .dst_port = static_cast<uint16_t>(alone[DST_PORT]),
+                                                       });
+        }
+    }
+}
+
+// Each value is the one without its lowest bit, plus that bit.
+static void wccp_mask_assignment_generate_values(wccp_service_group *group) {
+    const uint32_t count = 1u << group->mask_bit_count;
+    group->mask_values[0] = {};
+    for (uint32_t k = 1; k < count; k++) {
+        const wccp_mask &bit = group->mask_bit_array[__builtin_ctz(k)];
+        wccp_mask_value value = group->mask_values[k & (k - 1)];
+        value.src_ip |= bit.src_ip;
+        value.dst_ip |= bit.dst_ip;
+        value.src_port = static_cast<uint16_t>(value.src_port | bit.src_port);
+        value.dst_port = static_cast<uint16_t>(value.dst_port | bit.dst_port);
+        group->mask_values[k] = value;
+    }
+    group->mask_value_count = count;
+}
+
+void wccp_mask_assignment_calculate_value_table(wccp_service_group *group) {
+    group->mask_bit_count = 0;
+    memset(group->mask_bit_array, 0, sizeof group->mask_bit_array);
+    group->mask_value_count = 0;
+    memset(group->mask_values, 0, sizeof group->mask_values);
+    wccp_mask *const mask = &group->mask_in_use;
+    *mask = {group->mask_src_ip, group->mask_dst_ip, group->mask_src_port, group->mask_dst_port};
+    group->mask_value_bits = group->mask_bits;
+    if (group->mask_value_bits > WCCP_MAX_MASK_BITS) {
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d: mask assignment: too many bits (%d) set in mask: sip 0x%x dip 0x%x sport 0x%x "
+               "dport 0x%x . using defaultdestination MASK 0x%x",
+               group->id, static_cast<int>(group->mask_value_bits), mask->src_ip, mask->dst_ip,
+               mask->src_port, mask->dst_port, DEFAULT_DST_IP_MASK);
+        *mask = {0, DEFAULT_DST_IP_MASK, 0, 0};
+        group->mask_value_bits = util_wccp_mask_get_bits_set(mask);
+    }
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: mask assignment: bits set: %d sip 0x%x dip 0x%x sport 0x%x dport 0x%x ",
+           group->id, static_cast<int>(group->mask_value_bits), mask->src_ip, mask->dst_ip, mask->src_port,
+           mask->dst_port);
+    build_bit_array(group);
+    wccp_mask_assignment_generate_values(group);
+}
+
+int wccp_mask_assignment_assign_mask_values(wccp_service_group *group) {
+    if (group->mask_value_count != group->bucket_count) {
+        QV_LOG(LC_LOG_ERR,
+               "WCCP GRP %d: mask assignment: mask values (%d) and number of buckets (%d) mismatch.",
+               group->id, static_cast<int>(group->mask_value_count), static_cast<int>(group->bucket_count));
+        return 1;
+    }
+    for (uint32_t i = 0; i < group->dsg_active_count; i++)
+        group->dsg_appliances[i].assigned = 0;
+    for (uint32_t i = 0; i < group->mask_value_count; i++) {
+        group->mask_values[i].appliance_ipa = group->bucket_ipa[i];
+        if (wccp_dsg_appliance *owner =
+                wccp_find_dsg_appliance(group, group->dsg_active_count, group->bucket_ipa[i]))
+            owner->assigned++;
+    }
+    const wccp_mask &mask = group->mask_in_use;
+    QV_LOG(LC_LOG_INFO,
+           "WCCP GRP %d: mask assign. values/appliance ids added. mask: sip 0x%x dip 0x%x sport 0x%x dport "
+           "0x%x values: %d active appliances: %d",
+           group->id, mask.src_ip, mask.dst_ip, mask.src_port, mask.dst_port,
+           static_cast<int>(group->mask_value_count), static_cast<int>(group->dsg_active_count));
+    return 0;
+}

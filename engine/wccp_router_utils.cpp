@@ -1,0 +1,345 @@
+// Sending routers: the routers from which a group has accepted an I-See-You.
+//
+// A record is made from a router's first I-See-You, once its capabilities have been found to agree, and lives
+// until the router has been silent for 40 seconds or the group stops. The first router decides the group's
+// forwarding, assignment and return methods for all that follow; they stand until the last router has gone.
+// The records belong to the group's list, and so do the replies to Removal Queries, each a finished message
+// with the number of times that it still has to go out.
+//
+// The engine lock is held throughout: by a receive thread for creation, decision and queries, by the timer
+// thread for the sweep and the replies. Nothing here reads a message or changes a view of its own accord.
+//
+// A thread can be cancelled while it waits for tunneld with a record in its hands. A new record is owned by
+// the scope until it stands in the list with its tunnel reference noted, and wccp_add_tunnel can't be
+// cancelled between the two. A record that goes is owned by the scope from the moment it leaves the list:
+// however the wait for its tunnel ends, it is freed and the count falls with it.
+#include "engine/wccp_router_utils.h"
+
+#include "engine/wccp_alarms.h"
+#include "engine/wccp_pkt_mgr.h"
+#include "engine/wccp_state.h"
+#include "engine/wccp_tunnel.h"
+#include "engine/wccp_utils.h"
+#include "engine/wccp_view_utils.h"
+#include "engine/wccp_wire.h"
+#include "runtime/guards.h"
+
+static constexpr uint32_t SILENCE_LIMIT = 40; // seconds without an I-See-You
+static constexpr uint8_t REPLY_TRANSMISSIONS = 3;
+
+static void free_router(wccp_sending_router *router) {
+    wccp_free(router);
+}
+static void free_reply(wccp_removal_reply *reply) {
+    wccp_free(reply);
+}
+
+wccp_sending_router *wccp_find_sending_router(wccp_service_group *group, be32 router_id) {
+    for (wccp_sending_router *router = group->sending_routers; router; router = router->next)
+        if (router->router_id == router_id)
+            return router;
+    return nullptr;
+}
+
+// The capability decision.
+
+namespace {
+
+using capabilities = wccp_rtr_capabilities;
+
+// One of the three methods to agree on: where it stands, which code wins when both sides can do either, and
+// what is said and returned when they have none in common.
+struct capability_step {
+    uint32_t capabilities::*word;
+    uint32_t (*preferred)(const capabilities *agreed);
+    int refusal;
+    void (*complain)(int group, be32 router_id, const capabilities *local, const capabilities *offered);
+};
+
+// Only the two low bits of an offer mean anything, and as a bit set they are a method code.
+uint32_t offered_code(uint32_t word) {
+    return word & WCCP_METHOD_EITHER;
+}
+
+const capability_step capability_steps[] = {
+    {&capabilities::forwarding, [](const capabilities *) -> uint32_t { return WCCP_METHOD_L2; }, 0,
+     [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
+         QV_LOG(
+             LC_LOG_WARNING,
+             "WCCP GRP %d: incompatible capabilities (router id %s) : local: (fwd encap: %s ) router sent: "
+             "(fwd: %s return: %s)",
+             group, addr_text(router_id).s, wccp_method_name(local->forwarding),
+             wccp_method_name(offered_code(offered->forwarding)),
+             wccp_method_name(offered_code(offered->ret)));
+     }},
+    // Mask goes with L2, hash with GRE.
+    {&capabilities::assignment,
+     [](const capabilities *agreed) -> uint32_t {
+         return agreed->forwarding == WCCP_METHOD_L2 ? WCCP_ASSIGN_MASK : WCCP_ASSIGN_HASH;
+     },
+     0,
+     [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
+         QV_LOG(LC_LOG_WARNING,
+                "WCCP GRP %d: incompatible capabilities (router id %s) : local assign method: %s  router "
+                "assign method: %s",
+                group, addr_text(router_id).s, wccp_assign_method_name(local->assignment),
+                wccp_assign_method_name(offered_code(offered->assignment)));
+     }},
+    {&capabilities::ret, [](const capabilities *) -> uint32_t { return WCCP_METHOD_GRE; }, 1,
+     [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
+         QV_LOG(LC_LOG_WARNING,
+                "WCCP GRP %d: incompatible capabilities (router id %s) : local return method: %s  router "
+                "return method: %s",
+                group, addr_text(router_id).s, wccp_method_name(local->ret),
+                wccp_method_name(offered_code(offered->ret)));
+     }},
+};
+
+// The code that both sides can do, 0 for none.
+uint32_t common_code(uint32_t local, uint32_t offered, uint32_t preferred) {
+    if (local > WCCP_METHOD_EITHER)
+        return WCCP_METHOD_NONE;
+    const uint32_t common = local & offered_code(offered);
+    return common == WCCP_METHOD_EITHER ? preferred : common;
+}
+
+} // namespace
+
+int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,
+                                     const wccp_rtr_capabilities *offered, wccp_rtr_capabilities *out_agreed,
+                                     uint32_t *out_compatible) {
+    *out_compatible = 0;
+    *out_agreed = {};
+    const capabilities configured = {group->cfg_fwd_method, group->cfg_assign_method, WCCP_METHOD_EITHER};
+    const capabilities in_force = {group->fwd_method, group->assign_method, group->ret_method};
+    const capabilities *local = group->state_flags & WCCP_CAPABILITIES_SET ? &in_force : &configured;
+    capabilities agreed = {};
+    for (const capability_step &step : capability_steps) {
+        agreed.*step.word = common_code(local->*step.word, offered->*step.word, step.preferred(&agreed));
+        if (agreed.*step.word == WCCP_METHOD_NONE) {
+            step.complain(group->id, router_id, local, offered);
+            return step.refusal;
+        }
+    }
+    *out_agreed = agreed;
+    *out_compatible = 1;
+    return 0;
+}
+
+wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 router_id,
+                                                const wccp_rtr_capabilities *offered,
+                                                const wccp_rtr_capabilities *agreed) {
+    if (is_zero(router_id)) {
+        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: invalid router id in ICU. 0.0.0.0", group->id);
+        return nullptr;
+    }
+    if (group->sending_router_count >= WCCP_MAX_ROUTERS) {
+        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: Router Maximum (%d) reached", group->id,
+               static_cast<int>(WCCP_MAX_ROUTERS));
+        return nullptr;
+    }
+    owned<wccp_sending_router, free_router> made(
+        static_cast<wccp_sending_router *>(wccp_malloc(sizeof(wccp_sending_router))));
+    if (!made.pointer) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: sending router creation failed. router id %s ", group->id,
+               addr_text(router_id).s);
+        return nullptr;
+    }
+    uint32_t flags = WCCP_RTR_ONE_WAY;
+    if (agreed->forwarding == WCCP_METHOD_GRE || agreed->ret == WCCP_METHOD_GRE) {
+        if (wccp_add_tunnel(group->id, group->appliance_ipa, router_id))
+            return nullptr;
+        flags |= WCCP_RTR_HAS_TUNNEL;
+    }
+    wccp_sending_router *router = made.take();
+    router->router_id = router_id;
+    router->flags = flags;
+    router->state_time = wccp_g.seconds;
+    router->cap_fwd = static_cast<uint8_t>(offered->forwarding & 0xff);
+    router->cap_assign = static_cast<uint8_t>(offered->assignment & 0xff);
+    router->cap_ret = static_cast<uint8_t>(offered->ret & 0xff);
+    group->sending_router_count++;
+    list_push_head(&group->sending_routers, router);
+    if (!(group->state_flags & WCCP_CAPABILITIES_SET)) {
+        group->fwd_method = agreed->forwarding;
+        group->assign_method = agreed->assignment;
+        group->ret_method = agreed->ret;
+        group->state_flags |= WCCP_CAPABILITIES_SET;
+        QV_LOG(LC_LOG_INFO,
+               "WCCP GRP %d: agreed capabilities: fwd: %d assign: %d return: %d deciding rtr id %s",
+               group->id, static_cast<int>(group->fwd_method), static_cast<int>(group->assign_method),
+               static_cast<int>(group->ret_method), addr_text(router_id).s);
+    }
+    wccp_alarm_schedule_verify_router_connectivity_timer(group, 0);
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: created ICU sending router %s ", group->id, addr_text(router_id).s);
+    return router;
+}
+
+// Inactivity.
+
+namespace {
+
+// A router that has left the list, to the end of the scope.
+struct departing_router {
+    ~departing_router() {
+        group->sending_router_count--;
+        wccp_free(router);
+    }
+    wccp_service_group *group;
+    wccp_sending_router *router;
+};
+
+void drop_views(wccp_service_group *group, wccp_sending_router *router) {
+    for (uint32_t i = 0; i < router->view_router_count; i++)
+        wccp_remove_router_from_view_list(group, router->view_routers[i].ipa);
+    router->view_router_count = 0;
+    for (uint32_t i = 0; i < router->view_appliance_count; i++)
+        wccp_remove_appliance_from_view_list(group, router->view_appliances[i].ipa);
+    router->view_appliance_count = 0;
+}
+
+void remove_silent_router(wccp_service_group *group, wccp_sending_router *router) {
+    list_unlink(router);
+    const departing_router departing = {group, router};
+    {
+        const cancel_off_guard whole; // a line of the log must not part the record from its view entries
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removing router (router id: %s) due to inactivity.", group->id,
+               addr_text(router->router_id).s);
+        drop_views(group, router);
+    }
+    if (router->flags & WCCP_RTR_HAS_TUNNEL)
+        wccp_del_tunnel(group->id, group->appliance_ipa, router->router_id, 0);
+    if (group->sending_router_count == 1) {
+        group->fwd_method = WCCP_METHOD_NONE;
+        group->assign_method = WCCP_ASSIGN_NONE;
+        group->ret_method = WCCP_METHOD_NONE;
+        wccp_appliance_state_init(group);
+        group->state_flags &= ~WCCP_CAPABILITIES_SET;
+    }
+    if (router->self_buckets != 0) {
+        if (group->redirecting_routers != 0)
+            group->redirecting_routers--;
+        if (group->redirecting_routers == 0)
+            wccp_appliance_state_init(group);
+    }
+    group->change_number++;
+    group->state_flags |= WCCP_DESG_ELECT_PENDING;
+}
+
+} // namespace
+
+int wccp_monitor_sending_routers(wccp_service_group *group) {
+    wccp_sending_router *next;
+    for (wccp_sending_router *router = group->sending_routers; router; router = next) {
+        next = router->next;
+        if (wccp_g.seconds - router->last_icu_time < SILENCE_LIMIT)
+            continue;
+        remove_silent_router(group, router);
+        wccp_alarm_raise_router_down_alarm(group);
+        group->routers_timed_out++;
+    }
+    return 0;
+}
+
+// Removal Queries.
+
+int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id, be32 receive_id) {
+    wccp_sending_router *router = wccp_find_sending_router(group, router_id);
+    if (!router) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removal query request. cannot find router. (router id %s)",
+               group->id, addr_text(router_id).s);
+        return 0;
+    }
+    if (!(router->flags & WCCP_RTR_TWO_WAY)) {
+        QV_LOG(LC_LOG_INFO,
+               "WCCP GRP %d: removal query request. router (router id %s) is not 2-way connected. igoring "
+               "request",
+               group->id, addr_text(router_id).s);
+        return 0;
+    }
+    router->receive_id = receive_id;
+    owned<wccp_removal_reply, free_reply> reply(
+        static_cast<wccp_removal_reply *>(wccp_malloc(sizeof(wccp_removal_reply))));
+    if (!reply.pointer) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removal query request. cannot allocate pkt to send. (router id %s)",
+               group->id, addr_text(router_id).s);
+        return 1;
+    }
+    wccp_pkt *pkt = &reply.pointer->pkt;
+    pkt->cursor = pkt->data;
+    pkt->ipa = router_id;
+    if (const int status = wccp_pkt_build_here_i_am(group, pkt)) {
+        QV_LOG(LC_LOG_INFO,
+               "WCCP GRP %d: removal query request reply failed: building HERE_I_AM failed. (router id %s)",
+               group->id, addr_text(router_id).s);
+        return status;
+    }
+    reply.pointer->tx_left = REPLY_TRANSMISSIONS;
+    list_push_head(&group->removal_replies, reply.take());
+    group->removal_reply_count++;
+    return 0;
+}
+
+int wccp_send_router_removal_query_reply(wccp_service_group *group) {
+    wccp_removal_reply *next;
+    for (wccp_removal_reply *reply = group->removal_replies; reply; reply = next) {
+        next = reply->next;
+        if (wccp_transmit_packet(group, &reply->pkt, WCCP_REMOVAL_REPLY))
+            QV_LOG(LC_LOG_ERR, "WCCP GRP %u: %s failed.", group->id, "sending Query Response HERE_I_AM ");
+        if (--reply->tx_left == 0) {
+            list_unlink(reply);
+            group->removal_reply_count--;
+            wccp_free(reply);
+        }
+    }
+    return 0;
+}
+
+// Questions about the routers.
+
+static bool assigns_to_another_appliance(const wccp_service_group *group, const wccp_sending_router *router) {
+    for (uint32_t i = 0; i < router->view_appliance_count; i++) {
+        const wccp_rtr_view_appliance *entry = &router->view_appliances[i];
+        if (!(entry->ipa == group->appliance_ipa) && entry->buckets_assigned != 0)
+            return true;
+    }
+    return false;
+}
+
+int wccp_any_routers_redirecting_to_other_appliances(wccp_service_group *group,
+                                                     const wccp_sending_router *router) {
+    for (const wccp_sending_router *other = group->sending_routers; other; other = other->next)
+        if (other != router && assigns_to_another_appliance(group, other))
+            return 1;
+    return 0;
+}
+
+int wccp_get_router_connection_stats(wccp_service_group *group, uint32_t *out_one_way,
+                                     uint32_t *out_two_way) {
+    if (!group || !out_one_way || !out_two_way)
+        return 1;
+    *out_one_way = *out_two_way = 0;
+    for (const wccp_sending_router *router = group->sending_routers; router; router = router->next) {
+        if (router->flags & WCCP_RTR_TWO_WAY)
+            ++*out_two_way;
+        else if (router->flags & WCCP_RTR_ONE_WAY)
+            ++*out_one_way;
+    }
+    return 0;
+}
+
+int wccp_get_router_assignment(wccp_service_group *group, wccp_sending_router *router, be32 appliance,
+                               uint32_t *out_buckets) {
+    if (!group || !router || !out_buckets)
+        return 1;
+    *out_buckets = 0;
+    const wccp_rtr_view_appliance *entry = wccp_get_router_appliance_view_element(router, appliance);
+    if (!entry) {
+        QV_LOG(LC_LOG_ERR,
+               "WCCP GRP %d: get router assign. failed. cannot find appliance %s in router's view: %s",
+               group->id, addr_text(appliance).s, addr_text(router->router_id).s);
+        return 1;
+    }
+    *out_buckets = entry->buckets_assigned;
+    return 0;
+}

@@ -1,0 +1,249 @@
+// The heartbeat of a group: what is due in a tick, the election of the designated appliance, and the state
+// (INIT, ACTIVE, BACKUP) with its role.
+//
+// Once a second the timer thread calls wccp_process_timers for each enabled group, under the engine lock that
+// it holds for the whole tick; the only clock is that tick. What a tick does, and in which order, is the
+// table of steps below. A step that fails is logged and the next one runs: a message that could not be sent
+// goes again after its period, and an election that selected nobody waits for the next change of a view.
+//
+// The election exchanges nothing. Each appliance applies the same rule to the same view: the lowest address
+// is designated, provided that every router that anybody reports is heard from both ways. Being designated
+// and being ACTIVE have nothing to do with each other.
+//
+// The state functions run on the tick or on a receive thread. Each entry into a state tells the role to the
+// policy groups and sends a state event, also when the role is the same as before; once the exit has begun
+// the role still changes, but nobody is told.
+#include "engine/wccp_state.h"
+
+#include <cstdio>
+
+#include "engine/wccp_alarms.h"
+#include "engine/wccp_assignment.h"
+#include "engine/wccp_host.h"
+#include "engine/wccp_pkt_mgr.h"
+#include "engine/wccp_router_utils.h"
+#include "engine/wccp_utils.h"
+#include "engine/wccp_view_utils.h"
+#include "engine/wccp_wire.h"
+#include "engine/wccpd_common.h"
+#include "platform/qvcommon.h"
+
+static constexpr uint32_t ASSIGN_PERIOD = 10;         // seconds
+static constexpr uint32_t ASSIGN_DELAY_ELECTION = 16; // for the routers' views to settle
+static constexpr uint32_t ASSIGN_DELAY_WEIGHT_CHANGE = 1;
+
+// The state.
+
+int wccp_set_role_and_send_event(uint8_t id, uint32_t role) {
+    static const uint8_t event_code = 237;
+    const int result = wccp_set_role(id, role);
+    if (wccpd_shutdown_in_progress() == 1)
+        return result;
+    char text[8];
+    snprintf(text, sizeof text, "%d", id);
+    if (role > WCCP_ROLE_UNKNOWN)
+        return 1;
+    qv_state_event_send(1, text, role, &event_code, qv_alm_mgmt_session);
+    return result;
+}
+
+static void make_only_state(wccp_service_group *group, uint32_t state) {
+    group->state_flags = (group->state_flags & ~WCCP_STATE_MASK) | state;
+}
+
+int wccp_appliance_state_init(wccp_service_group *group) {
+    if (group->state_flags & WCCP_STATE_INIT)
+        return 0;
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : INIT", group->id);
+    wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP);
+    make_only_state(group, WCCP_STATE_INIT);
+    return 0;
+}
+
+int wccp_appliance_state_active(wccp_service_group *group) {
+    if (group->state_flags & WCCP_STATE_ACTIVE)
+        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: is already ACTIVE.", group->id);
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : ACTIVE", group->id);
+    wccp_set_role_and_send_event(group->id, WCCP_ROLE_ACTIVE);
+    group->transitions++;
+    make_only_state(group, WCCP_STATE_ACTIVE);
+    group->state_time = wccp_g.seconds;
+    return 0;
+}
+
+int wccp_appliance_state_backup(wccp_service_group *group) {
+    if (group->state_flags & WCCP_STATE_BACKUP)
+        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: is already BACKUP", group->id);
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : BACKUP", group->id);
+    wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP);
+    group->transitions++;
+    make_only_state(group, WCCP_STATE_BACKUP);
+    group->state_time = wccp_g.seconds;
+    return 0;
+}
+
+// The assignment that a designated appliance sends.
+
+void wccp_clear_redirect_assign_states(wccp_service_group *group) {
+    group->assign_timer.active = 0;
+    group->pending_acks = 0;
+    for (wccp_sending_router *router = group->sending_routers; router; router = router->next) {
+        router->flags &= ~WCCP_RTR_ASSIGN_UNACKED;
+        router->assign_tx_count = 0;
+    }
+}
+
+int wccp_update_designated_redirect_assignment(wccp_service_group *group, int reason) {
+    if (group->designated != 1) {
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d: DSG event: redirect assign  ignored. appliance is not the designated.",
+               group->id);
+        return 0;
+    }
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: redirect assign selection", group->id);
+    wccp_designated_appliance_assignment_start(group);
+    for (const wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next) {
+        if (wccp_appliance_is_reported_by_all_senders(group, entry->ipa))
+            wccp_designated_appliance_assignment_add(group, entry);
+        else
+            QV_LOG(LC_LOG_WARNING,
+                   "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) is not in all sending "
+                   "router views). CHECK configuration.",
+                   group->id, addr_text(entry->ipa).s, entry->weight);
+    }
+    wccp_designated_appliance_assignment_finish(group);
+    if (group->dsg_active_count == 0) {
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d: DSG event: NO redirect eligible appliances. CHECK configuration.", group->id);
+        wccp_designated_appliance_assignment_cleanup(group);
+        return 1;
+    }
+    group->dsg_key_change++;
+    group->pending_acks = static_cast<uint8_t>(group->sending_router_count & 0xff);
+    for (wccp_sending_router *router = group->sending_routers; router; router = router->next) {
+        router->flags |= WCCP_RTR_ASSIGN_UNACKED;
+        router->assign_tx_count = 0;
+    }
+    QV_LOG(LC_LOG_INFO,
+           "WCCP GRP %d: DSG event: redirect SELECTED. active appliances %d ICU TX routers %u redirect "
+           "assignment key 0x%x",
+           group->id, static_cast<int>(group->dsg_active_count), group->sending_router_count,
+           group->dsg_key_change);
+    group->assign_timer = {
+        .active = 1,
+        .mode = WCCP_TIMER_REPEATS,
+        .remaining = 0,
+        .period = ASSIGN_PERIOD,
+        .countdown =
+            reason == WCCP_ASSIGN_AFTER_ELECTION ? ASSIGN_DELAY_ELECTION : ASSIGN_DELAY_WEIGHT_CHANGE,
+    };
+    return 0;
+}
+
+// The election.
+
+static bool every_router_is_two_way(wccp_service_group *group) {
+    for (const wccp_view_router *entry = group->router_view; entry; entry = entry->next) {
+        const wccp_sending_router *router = wccp_find_sending_router(group, entry->ipa);
+        if (!router || !(router->flags & WCCP_RTR_TWO_WAY))
+            return false;
+    }
+    return true;
+}
+
+static bool has_lower_appliance(const wccp_service_group *group) {
+    const uint32_t own = to_host(group->appliance_ipa);
+    for (const wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next)
+        if (to_host(entry->ipa) < own)
+            return true;
+    return false;
+}
+
+static int wccp_elect_designated_appliance(wccp_service_group *group) {
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: new designated selection.", group->id);
+    group->state_flags &= ~WCCP_DESG_ELECT_PENDING;
+    const uint32_t was_designated = group->designated;
+    group->designated = 0;
+    wccp_clear_redirect_assign_states(group);
+    wccp_alarm_schedule_verify_allocation_table_timer(group, 1);
+    if (group->appliance_view_count == 0) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: appliance view is empty. try later.", group->id);
+        return 0;
+    }
+    if (!every_router_is_two_way(group)) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: not selected (no ICUs)", group->id);
+        return 0;
+    }
+    if (has_lower_appliance(group)) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: not selected (not the lowest ipa %s)", group->id,
+               addr_text(group->appliance_ipa).s);
+        return 0;
+    }
+    group->designated = 1;
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: DSG SELECTED (%s) dsg key : 0x%x", group->id,
+           addr_text(group->appliance_ipa).s, group->dsg_key_change);
+    if (was_designated == 0)
+        wccp_clear_assignment_block(group);
+    wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_ELECTION);
+    return 0;
+}
+
+// The tick.
+
+namespace {
+
+// A step is due when its timer fires, or without a timer when `pending` says so. A null `words` is a step
+// that can't fail.
+struct tick_step {
+    wccp_timer wccp_service_group::*timer;
+    bool (*pending)(const wccp_service_group *group);
+    const char *words;
+    int (*action)(wccp_service_group *group);
+};
+
+const tick_step tick_steps[] = {
+    {nullptr, [](const wccp_service_group *group) { return group->removal_reply_count != 0; },
+     "sending Router Query Reply", wccp_send_router_removal_query_reply},
+    {&wccp_service_group::hia_timer, nullptr, "sending HERE_I_AM ",
+     [](wccp_service_group *group) { return wccp_transmit_packet(group, group->tx_pkt, WCCP_HERE_I_AM); }},
+    {nullptr,
+     [](const wccp_service_group *group) { return (group->state_flags & WCCP_DESG_ELECT_PENDING) != 0; },
+     nullptr, wccp_elect_designated_appliance},
+    {&wccp_service_group::assign_timer, nullptr, "sending REDIRECT ASSGN",
+     [](wccp_service_group *group) {
+         return wccp_transmit_packet(group, group->tx_pkt, WCCP_REDIRECT_ASSIGN);
+     }},
+    {&wccp_service_group::monitor_timer, nullptr, "monitor sending routers", wccp_monitor_sending_routers},
+    {&wccp_service_group::router_alarm_timer, nullptr, "alarm verify routers",
+     wccp_alarm_verify_router_connectivity},
+    {&wccp_service_group::assign_alarm_timer, nullptr, "alarm assignment mismatch",
+     wccp_alarms_verify_allocation_table},
+};
+
+bool timer_fires(wccp_timer *timer) {
+    if (timer->active != 1)
+        return false;
+    if (timer->countdown > 1) {
+        timer->countdown--;
+        return false;
+    }
+    timer->countdown = timer->period;
+    if (timer->mode == WCCP_TIMER_COUNTS) {
+        if (timer->remaining != 0)
+            timer->remaining--;
+        if (timer->remaining == 0)
+            timer->active = 0;
+    }
+    return true;
+}
+
+} // namespace
+
+int wccp_process_timers(wccp_service_group *group) {
+    for (const tick_step &step : tick_steps) {
+        const bool due = step.timer ? timer_fires(&(group->*step.timer)) : step.pending(group);
+        if (due && step.action(group) && step.words)
+            QV_LOG(LC_LOG_ERR, "WCCP GRP %u: %s failed.", group->id, step.words);
+    }
+    return 0;
+}

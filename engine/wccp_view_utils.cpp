@@ -1,0 +1,465 @@
+// Views: what the routers of a group report of routers and appliances, and what they assign to this
+// appliance.
+//
+// There are two levels. Each sending router keeps its last report as arrays (view_routers, view_appliances);
+// the group keeps the union over all of them as lists (router_view, appliance_view), whose entries count the
+// array entries that name them. A report is compared with the one before it, what is new or gone moves the
+// union, and any such move raises the change number and asks for an election at the next tick. The union's
+// entries are made by the report that first names them and freed with their last mention; nobody keeps a
+// pointer to one.
+//
+// The engine lock is held throughout, by a receive thread, or by the timer thread when a silent router is
+// taken out. In steady state a report equals the one before it, entry by entry, and costs a comparison and a
+// copy: an address is looked for at its old place first, and only then anywhere else.
+//
+// A report may name an address more than once. Each mention is matched with an old mention of its own, so
+// that the union's counts and the arrays stay in step whatever follows; and this appliance counts as lost
+// only when no mention of it is left. An update that fails in the middle leaves the router's arrays as they
+// were, so that the next report is compared with the last complete one.
+//
+// The role of this appliance follows from what one router assigned before and assigns now: one table, at the
+// end of this file.
+#include "engine/wccp_view_utils.h"
+
+#include <cstring>
+
+#include "engine/wccp_alarms.h"
+#include "engine/wccp_assignment.h"
+#include "engine/wccp_router_utils.h"
+#include "engine/wccp_state.h"
+#include "engine/wccp_utils.h"
+#include "engine/wccp_wire.h"
+
+static constexpr uint32_t MARK = 1;
+static constexpr uint16_t HASH_BUCKETS = WCCP_MAX_BUCKETS;
+
+// The lists.
+
+template <typename Entry>
+static Entry *find_in_union(Entry *entry, be32 address) {
+    while (entry && !(entry->ipa == address))
+        entry = entry->next;
+    return entry;
+}
+
+int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_appliance *entry) {
+    wccp_view_appliance *head = group->appliance_view;
+    if (!head) {
+        list_push_head(&group->appliance_view, entry);
+        return 0;
+    }
+    const bool above = entry->weight != head->weight ? entry->weight > head->weight
+                                                     : to_host(entry->ipa) > to_host(head->ipa);
+    if (above) {
+        list_push_head(&group->appliance_view, entry);
+        return 0;
+    }
+    list_insert_behind(head, entry);
+    if (entry->weight == head->weight && entry->ipa == head->ipa) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding appliance sorted failed. appliance %s", group->id,
+               addr_text(entry->ipa).s);
+        return 1;
+    }
+    return 0;
+}
+
+// Takes one mention from an entry of a union, and the entry with the last one. False when there is none.
+template <typename Entry>
+static bool drop_mention(Entry *first, uint32_t *count, be32 address) {
+    Entry *entry = find_in_union(first, address);
+    if (!entry)
+        return false;
+    if (--entry->ref_count == 0) {
+        --*count;
+        list_unlink(entry);
+        wccp_free(entry);
+    }
+    return true;
+}
+
+int wccp_remove_router_from_view_list(wccp_service_group *group, be32 address) {
+    if (drop_mention(group->router_view, &group->router_view_count, address))
+        return 0;
+    QV_LOG(LC_LOG_ERR,
+           "WCCP GRP %d: removal of router failed. entry not found in router view list. router ip  %s",
+           group->id, addr_text(address).s);
+    return 1;
+}
+
+int wccp_remove_appliance_from_view_list(wccp_service_group *group, be32 address) {
+    if (drop_mention(group->appliance_view, &group->appliance_view_count, address))
+        return 0;
+    QV_LOG(LC_LOG_ERR,
+           "WCCP GRP %d: appliance remove failed. entry not found in appliance list. appliance ip %s",
+           group->id, addr_text(address).s);
+    return 1;
+}
+
+static void view_has_changed(wccp_service_group *group, const wccp_sending_router *router, const char *what) {
+    group->change_number++;
+    group->state_flags |= WCCP_DESG_ELECT_PENDING;
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: %s view has changed. sending router %s local change number %d",
+           group->id, what, addr_text(router->router_id).s, static_cast<int>(group->change_number));
+}
+
+// The old mention that a new one at position `place` is matched with: marked, or null when there is none.
+template <typename Entry>
+static Entry *mark_old_mention(Entry *old, uint32_t count, uint32_t place, be32 address) {
+    const auto matches = [address](const Entry &entry) {
+        return entry.ipa == address && !(entry.flags & MARK);
+    };
+    if (place < count && matches(old[place])) {
+        old[place].flags |= MARK;
+        return &old[place];
+    }
+    for (uint32_t i = 0; i < count; i++) {
+        if (matches(old[i])) {
+            old[i].flags |= MARK;
+            return &old[i];
+        }
+    }
+    return nullptr;
+}
+
+template <typename Entry>
+static void clear_marks(Entry *old, uint32_t count) {
+    for (uint32_t i = 0; i < count; i++)
+        old[i].flags &= ~MARK;
+}
+
+// Routers.
+
+static int add_router_mention(wccp_service_group *group, be32 address) {
+    wccp_view_router *entry = find_in_union(group->router_view, address);
+    if (!entry) {
+        entry = static_cast<wccp_view_router *>(wccp_malloc(sizeof *entry));
+        if (!entry) {
+            QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding router view failed. out of memory. router ipa %s",
+                   group->id, addr_text(address).s);
+            return 1;
+        }
+        entry->ipa = address;
+        group->router_view_count++;
+        list_push_head(&group->router_view, entry);
+    }
+    entry->ref_count++;
+    return 0;
+}
+
+int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
+                            const be32 *addresses) {
+    if (count > WCCP_MAX_ROUTERS)
+        return 1;
+    const uint32_t old_count = router->view_router_count;
+    bool changed = false;
+    clear_marks(router->view_routers, old_count);
+    for (uint32_t i = 0; i < count; i++) {
+        if (mark_old_mention(router->view_routers, old_count, i, addresses[i]))
+            continue;
+        if (add_router_mention(group, addresses[i]))
+            return 1;
+        changed = true;
+    }
+    for (uint32_t i = 0; i < old_count; i++) {
+        if (router->view_routers[i].flags & MARK)
+            continue;
+        wccp_remove_router_from_view_list(group, router->view_routers[i].ipa);
+        changed = true;
+    }
+    for (uint32_t i = 0; i < count; i++)
+        router->view_routers[i].ipa = addresses[i];
+    router->view_router_count = count;
+    if (changed)
+        view_has_changed(group, router, "router");
+    return 0;
+}
+
+// Appliances.
+
+// The weight of a web-cache element stands where its form says, and has been checked to lie in the message.
+static uint16_t weight_of(const uint8_t *element, const wccp_element_shape &shape) {
+    be16 weight;
+    memcpy(&weight, element + shape.weight_at, sizeof weight);
+    return to_host(weight);
+}
+
+// Takes the bucket bits of an element over; the number of buckets that they assign. The bits are added up
+// side by side in one word: without a machine instruction for it, eight calls that count one word each would
+// be the dearest thing in a whole I-See-You.
+static uint16_t take_bucket_bits(const wccp_wire_view_element_hash *element,
+                                 wccp_rtr_view_appliance *decoded) {
+    uint64_t in_bytes = 0;
+    for (uint32_t i = 0; i < 8; i += 2) {
+        decoded->bucket_bits[i] = to_host(element->bucket_words[i]);
+        decoded->bucket_bits[i + 1] = to_host(element->bucket_words[i + 1]);
+        uint64_t bits = uint64_t{decoded->bucket_bits[i]} << 32 | decoded->bucket_bits[i + 1];
+        bits -= (bits >> 1) & 0x5555555555555555;
+        bits = (bits & 0x3333333333333333) + ((bits >> 2) & 0x3333333333333333);
+        in_bytes += (bits + (bits >> 4)) & 0x0f0f0f0f0f0f0f0f;
+    }
+    const uint64_t in_pairs = (in_bytes & 0x00ff00ff00ff00ff) + ((in_bytes >> 8) & 0x00ff00ff00ff00ff);
+    decoded->buckets_assigned = static_cast<uint16_t>((in_pairs * 0x0001000100010001) >> 48);
+    decoded->buckets_total = HASH_BUCKETS;
+    return decoded->buckets_assigned;
+}
+
+int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, uint32_t count,
+                                                   const uint8_t *elements, wccp_rtr_view_appliance *decoded,
+                                                   wccp_assign_summary *out_hash) {
+    if (!group || !decoded || !out_hash || count > WCCP_MAX_APPLIANCES)
+        return 1;
+    *out_hash = {.valid = 1, .self_count = 0, .total_count = 0};
+    uint32_t total = 0;
+    for (uint32_t i = 0; i < count; i++, decoded++) {
+        const auto *head = reinterpret_cast<const wccp_wire_view_element *>(elements);
+        const uint16_t flags = to_host(head->flags);
+        const wccp_element_shape shape = wccp_view_element_shape(flags, group->compat_mode);
+        decoded->ipa = head->web_cache_id;
+        if (shape.form == WCCP_ELEMENT_HASH && to_host(head->hash_revision) != 0) {
+            QV_LOG(LC_LOG_ERR, "WCCP GRP %d: HASH revision is not supported.", group->id);
+            return 1;
+        }
+        decoded->weight = weight_of(elements, shape);
+        if (shape.form == WCCP_ELEMENT_REDIRECT) {
+            out_hash->valid = 0; // the assignment comes as a map
+        } else if (shape.form == WCCP_ELEMENT_HASH && flags & WCCP_IDENTITY_HISTORICAL) {
+            QV_LOG(LC_LOG_INFO, "WCCP GRP %d: app id. %s assignment is historical, ignored", group->id,
+                   addr_text(decoded->ipa).s);
+        } else if (shape.form == WCCP_ELEMENT_HASH) {
+            const uint16_t assigned =
+                take_bucket_bits(reinterpret_cast<const wccp_wire_view_element_hash *>(elements), decoded);
+            if (decoded->ipa == group->appliance_ipa)
+                out_hash->self_count = assigned;
+            total += assigned;
+        }
+        elements += shape.size;
+    }
+    out_hash->total_count = static_cast<uint16_t>(total < HASH_BUCKETS ? total : HASH_BUCKETS);
+    return 0;
+}
+
+// A router reports another weight than it did before.
+static int take_reported_weight(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
+    wccp_view_appliance *entry = find_in_union(group->appliance_view, element->ipa);
+    if (!entry) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: update appliance view list failed. cannot find appliance %s",
+               group->id, addr_text(element->ipa).s);
+        return 1;
+    }
+    if (entry->weight == element->weight)
+        return 0;
+    QV_LOG(LC_LOG_INFO,
+           "WCCP GRP %d: appliance %s weight change detected (%d -> %d). triggering redirect assignment "
+           "check.",
+           group->id, addr_text(entry->ipa).s, entry->weight, element->weight);
+    list_unlink(entry);
+    entry->weight = element->weight;
+    if (wccp_view_list_add_appliance_sorted(group, entry))
+        return 1;
+    if (group->designated != 1)
+        return 0;
+    wccp_clear_redirect_assign_states(group);
+    wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
+    return wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_WEIGHT_CHANGE) ? 1 : 0;
+}
+
+static int add_appliance_mention(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
+    wccp_view_appliance *entry = find_in_union(group->appliance_view, element->ipa);
+    if (!entry) {
+        entry = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof *entry));
+        if (!entry) {
+            QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding appliance view failed. out of memory. appliance ipa %s",
+                   group->id, addr_text(element->ipa).s);
+            return 1;
+        }
+        entry->ipa = element->ipa;
+        entry->weight = element->weight;
+        group->appliance_view_count++;
+        if (wccp_view_list_add_appliance_sorted(group, entry))
+            return 1;
+    }
+    entry->ref_count++;
+    return 0;
+}
+
+static void router_has_seen_us(wccp_service_group *group, wccp_sending_router *router) {
+    router->flags = (router->flags & ~WCCP_RTR_ONE_WAY) | WCCP_RTR_TWO_WAY;
+    router->state_time = wccp_g.seconds;
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: router id %s is TWO-WAY connected.", group->id,
+           addr_text(router->router_id).s);
+    wccp_alarm_schedule_verify_router_connectivity_timer(group, 0);
+}
+
+static void router_has_lost_us(wccp_service_group *group, wccp_sending_router *router) {
+    router->flags = (router->flags & ~WCCP_RTR_TWO_WAY) | WCCP_RTR_ONE_WAY;
+    router->state_time = wccp_g.seconds;
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d router id %s is ONE-WAY connected.", group->id,
+           addr_text(router->router_id).s);
+    wccp_alarm_raise_router_down_alarm(group);
+}
+
+static bool lists(const wccp_rtr_view_appliance *entries, uint32_t count, be32 address) {
+    for (uint32_t i = 0; i < count; i++)
+        if (entries[i].ipa == address)
+            return true;
+    return false;
+}
+
+int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
+                               const wccp_rtr_view_appliance *decoded) {
+    if (count > WCCP_MAX_APPLIANCES)
+        return 1;
+    const uint32_t old_count = router->view_appliance_count;
+    wccp_rtr_view_appliance *const old = router->view_appliances;
+    bool changed = false;
+    clear_marks(old, old_count);
+    for (uint32_t i = 0; i < count; i++) {
+        const wccp_rtr_view_appliance *element = &decoded[i];
+        if (const wccp_rtr_view_appliance *known = mark_old_mention(old, old_count, i, element->ipa)) {
+            if (known->weight != element->weight && take_reported_weight(group, element))
+                return 1;
+            continue;
+        }
+        if (add_appliance_mention(group, element))
+            return 1;
+        changed = true;
+        if (element->ipa == group->appliance_ipa)
+            router_has_seen_us(group, router);
+    }
+    for (uint32_t i = 0; i < old_count; i++) {
+        if (old[i].flags & MARK)
+            continue;
+        wccp_remove_appliance_from_view_list(group, old[i].ipa);
+        changed = true;
+        if (old[i].ipa == group->appliance_ipa && !lists(decoded, count, old[i].ipa))
+            router_has_lost_us(group, router);
+    }
+    for (uint32_t i = 0; i < count; i++) {
+        old[i].ipa = decoded[i].ipa;
+        old[i].weight = decoded[i].weight;
+        old[i].buckets_assigned = decoded[i].buckets_assigned;
+        old[i].buckets_total = decoded[i].buckets_total;
+        if (decoded[i].buckets_assigned != 0)
+            memcpy(old[i].bucket_bits, decoded[i].bucket_bits, sizeof old[i].bucket_bits);
+    }
+    router->view_appliance_count = count;
+    if (changed)
+        view_has_changed(group, router, "appliance");
+    return 0;
+}
+
+wccp_rtr_view_appliance *wccp_get_router_appliance_view_element(wccp_sending_router *router, be32 address) {
+    for (uint32_t i = 0; i < router->view_appliance_count; i++)
+        if (router->view_appliances[i].ipa == address)
+            return &router->view_appliances[i];
+    return nullptr;
+}
+
+int wccp_appliance_is_reported_by_all_senders(wccp_service_group *group, be32 address) {
+    for (wccp_sending_router *router = group->sending_routers; router; router = router->next)
+        if (!wccp_get_router_appliance_view_element(router, address))
+            return 0;
+    return 1;
+}
+
+// The role.
+
+namespace {
+
+enum wanted : uint8_t { ZERO, SOME, ANY };
+
+bool suits(wanted wanted_value, uint16_t value) {
+    return wanted_value == ANY || (wanted_value == SOME) == (value != 0);
+}
+
+// What a router assigns to this appliance and to anybody, now and before; what that does to the number of
+// routers that redirect here; under which further condition, tested after that, which line is logged and
+// which state entered. A change that suits a row but not its condition goes on to the next row that it suits,
+// and counts once.
+struct redirect_row {
+    wanted self_now, total_now, self_before, total_before;
+    int8_t routers;
+    bool (*condition)(wccp_service_group *group, const wccp_sending_router *router);
+    const char *line;
+    int (*enter)(wccp_service_group *group);
+};
+
+bool is_first_router(wccp_service_group *group, const wccp_sending_router *) {
+    return group->redirecting_routers == 1;
+}
+bool none_left(wccp_service_group *group, const wccp_sending_router *) {
+    return group->redirecting_routers == 0;
+}
+bool none_left_but_elsewhere(wccp_service_group *group, const wccp_sending_router *router) {
+    return group->redirecting_routers == 0 && wccp_any_routers_redirecting_to_other_appliances(group, router);
+}
+bool in_init(wccp_service_group *group, const wccp_sending_router *) {
+    return (group->state_flags & WCCP_STATE_INIT) != 0;
+}
+bool backup_to_nobody(wccp_service_group *group, const wccp_sending_router *router) {
+    return group->state_flags & WCCP_STATE_BACKUP &&
+           !wccp_any_routers_redirecting_to_other_appliances(group, router);
+}
+
+const redirect_row redirect_rows[] = {
+    {SOME, ANY, ZERO, ANY, +1, is_first_router, "WCCP GRP %d: redirect: first router to self (router id %s )",
+     wccp_appliance_state_active},
+    {ZERO, SOME, ANY, ZERO, 0, in_init,
+     "WCCP GRP %d: redirect: router id %s is redirecting to other  appliance(s).",
+     wccp_appliance_state_backup},
+    {ZERO, SOME, SOME, SOME, -1, none_left,
+     "WCCP GRP %d: redirect: last router stopped redirecting to self. (router id %s)",
+     wccp_appliance_state_backup},
+    {ZERO, ZERO, SOME, ANY, -1, none_left_but_elsewhere,
+     "WCCP GRP %d: redirect: this rtr (id %s) does not redirect. but another router does",
+     wccp_appliance_state_backup},
+    {ZERO, ZERO, SOME, ANY, -1, none_left,
+     "WCCP GRP %d: redirect: rtr does not redirect. no redirecting routers (router id %s)",
+     wccp_appliance_state_init},
+    {ZERO, ZERO, ZERO, SOME, 0, backup_to_nobody,
+     "WCCP GRP %d: redirect: no routers redirecting to group (router id %s)", wccp_appliance_state_init},
+};
+
+void count_router(wccp_service_group *group, int8_t change) {
+    if (change > 0)
+        group->redirecting_routers++;
+    else if (change < 0 && group->redirecting_routers != 0)
+        group->redirecting_routers--;
+}
+
+} // namespace
+
+int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sending_router *router,
+                                          const wccp_assign_summary *hash, const wccp_assign_summary *mask) {
+    const wccp_assign_summary *now = mask->valid == 1 ? mask : hash;
+    if (now->valid != 1) {
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d: update redirect status: assign. info not found. sender rtr id: %s", group->id,
+               addr_text(router->router_id).s);
+        return 1;
+    }
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: RX redirect status: rtr id: %s to self: %d/%d buckets (%s)", group->id,
+           addr_text(router->router_id).s, now->self_count, now->total_count,
+           now == mask ? "mask assign" : "hash assign");
+    const uint16_t self_before = router->self_buckets, total_before = router->total_buckets;
+    if (now->self_count == self_before && now->total_count == total_before)
+        return 0;
+    wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
+    router->self_buckets = now->self_count;
+    router->total_buckets = now->total_count;
+    bool counted = false;
+    for (const redirect_row &row : redirect_rows) {
+        if (!suits(row.self_now, now->self_count) || !suits(row.total_now, now->total_count) ||
+            !suits(row.self_before, self_before) || !suits(row.total_before, total_before))
+            continue;
+        if (!counted)
+            count_router(group, row.routers);
+        counted = true;
+        if (!row.condition(group, router))
+            continue;
+        QV_LOG(LC_LOG_INFO, row.line, group->id, addr_text(router->router_id).s);
+        row.enter(group);
+        return 0;
+    }
+    return 0;
+}
