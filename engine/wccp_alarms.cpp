@@ -1,0 +1,237 @@
+// Alarms of a service group: the adjacency alarm, for routers that aren't fully connected, and the assignment
+// alarm, for a table that the routers don't carry out as it was meant.
+//
+// A bit in raised_alarms tells whether an alarm stands. Each has a check on a one-shot timer, armed by
+// whatever gave a reason to look: the check comes 60 seconds after the first reason, and later reasons don't
+// push it back unless they say so. Nothing arms it again once it has run, so a quiet group keeps what it has.
+// A router that goes, or stops listing this appliance, raises the adjacency alarm at once.
+//
+// The callers hold the engine lock, on the timer thread, a receive thread or the main thread; it guards the
+// bits, the timers and the text of the message. Messages go straight out on the alarm session and nothing
+// waits for an answer. One that can't go is lost: the bit changes all the same, and there is no resend.
+#include "engine/wccp_alarms.h"
+
+#include <cstdio>
+
+#include "engine/wccp_router_utils.h"
+#include "engine/wccp_utils.h"
+
+gcl_session *qv_alm_mgmt_session;
+
+static constexpr uint32_t CHECK_DELAY = 60; // seconds
+
+// Arming.
+
+static uint32_t arm_check(wccp_timer *timer, int restart) {
+    uint32_t length = CHECK_DELAY;
+    if (!restart && timer->active == 1 && timer->countdown != 0)
+        length = timer->countdown;
+    *timer = {.active = 1, .mode = WCCP_TIMER_COUNTS, .remaining = 1, .period = length, .countdown = length};
+    return length;
+}
+
+void wccp_alarm_schedule_verify_router_connectivity_timer(wccp_service_group *group, int restart) {
+    const uint32_t length = arm_check(&group->router_alarm_timer, restart);
+    group->alarm_router_sched++;
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: schedule router connectivity verify timer in %d seconds",
+           group->id, static_cast<int>(length));
+}
+
+void wccp_alarm_schedule_verify_allocation_table_timer(wccp_service_group *group, int restart) {
+    const uint32_t length = arm_check(&group->assign_alarm_timer, restart);
+    group->alarm_assign_sched++;
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: schedule assignment table verify timer in %d seconds", group->id,
+           static_cast<int>(length));
+}
+
+// Raising and clearing.
+
+namespace {
+
+struct alarm_kind {
+    uint16_t bit; // of raised_alarms
+    uint32_t type;
+    const char *raised;
+    const char *cleared;
+};
+const alarm_kind alarm_kinds[] = {
+    {WCCP_ALARM_ADJACENCY, 0x3001E, "WCCP GRP %d: alarm: raising adjacency down alarm",
+     "WCCP GRP %d: alarm: clearing adjacency down alarm"},
+    {WCCP_ALARM_ASSIGNMENT, 0x3001F, "WCCP GRP %d: alarm: raising assignment table mismatch alarm",
+     "WCCP GRP %d: alarm: clearing assignment table alarm"},
+};
+const alarm_kind *find_kind(uint16_t bit) {
+    for (const alarm_kind &kind : alarm_kinds)
+        if (kind.bit == bit)
+            return &kind;
+    return nullptr;
+}
+
+// The two texts of a message in the making; engine lock.
+char alarm_param_3[64];
+char alarm_comment[64];
+
+// One alarm event on the alarm session. There is no client session to send on yet, so none goes out.
+lc_status send_alarm_event([[maybe_unused]] const char *event, [[maybe_unused]] const char *type) {
+    return LC_NOT_IMPLEMENTED;
+}
+
+void tell_alarm(wccp_service_group *group, const alarm_kind *kind, const char *event, const char *text) {
+    snprintf(alarm_param_3, sizeof alarm_param_3, "%s:grp:%d",
+             group->interfaces[0] ? group->interfaces[0]->name : "", group->id);
+    snprintf(alarm_comment, sizeof alarm_comment, text, group->id);
+    QV_LOG(LC_LOG_INFO, "%s", alarm_comment);
+    char type[16];
+    snprintf(type, sizeof type, "%u", kind->type);
+    LOG_STATUS(send_alarm_event(event, type));
+}
+
+void wccp_alarm_raise_alarm(wccp_service_group *group, uint16_t bit) {
+    if (const alarm_kind *kind = find_kind(bit))
+        tell_alarm(group, kind, "/qv/alarms/events/raise_alarm", kind->raised);
+    group->raised_alarms |= bit;
+}
+
+void wccp_alarm_clear_alarm(wccp_service_group *group, uint16_t bit) {
+    if (const alarm_kind *kind = find_kind(bit))
+        tell_alarm(group, kind, "/qv/alarms/events/clear_alarm", kind->cleared);
+    group->raised_alarms = static_cast<uint16_t>(group->raised_alarms & ~bit);
+}
+
+bool stands(const wccp_service_group *group, uint16_t bit) {
+    return (group->raised_alarms & bit) != 0;
+}
+
+} // namespace
+
+void wccp_alarm_raise_router_down_alarm(wccp_service_group *group) {
+    if (!stands(group, WCCP_ALARM_ADJACENCY))
+        wccp_alarm_raise_alarm(group, WCCP_ALARM_ADJACENCY);
+    wccp_alarm_schedule_verify_router_connectivity_timer(group, 1);
+}
+
+void wccp_alarms_clear_all_raised_alarms(wccp_service_group *group) {
+    group->router_alarm_timer.active = 0;
+    group->assign_alarm_timer.active = 0;
+    for (const alarm_kind &kind : alarm_kinds)
+        if (stands(group, kind.bit))
+            wccp_alarm_clear_alarm(group, kind.bit);
+}
+
+void wccp_alarms_clear_all() {
+    QV_LOG(LC_LOG_INFO, "WCCP: alarms: clearing all alarms.");
+    const wccp_engine_lock lock;
+    for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
+        if (group->raised_alarms != 0)
+            wccp_alarms_clear_all_raised_alarms(group);
+}
+
+// The checks.
+
+int wccp_alarm_verify_router_connectivity(wccp_service_group *group) {
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: verify router connectivity.", group->id);
+    uint32_t one_way, two_way;
+    if (wccp_get_router_connection_stats(group, &one_way, &two_way)) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: alarm: get router connnection stats failed.", group->id);
+        return 1;
+    }
+    const uint32_t expected = group->mcast_configured == 1 ? 1 : group->ucast_router_count;
+    const bool healthy = one_way == 0 && two_way >= expected;
+    const bool raised = stands(group, WCCP_ALARM_ADJACENCY);
+    if (healthy && raised) {
+        QV_LOG(LC_LOG_INFO,
+               "WCCP GRP %d: alarm: clearing router down alarm: routers one-way: %d two-way: %d configured: "
+               "%d.",
+               group->id, static_cast<int>(one_way), static_cast<int>(two_way), static_cast<int>(expected));
+        wccp_alarm_clear_alarm(group, WCCP_ALARM_ADJACENCY);
+    } else if (!healthy && !raised) {
+        QV_LOG(
+            LC_LOG_INFO,
+            "WCCP GRP %d: alarm: raising router down alarm. routers configured: %d connections one-way: %d "
+            "two-way: %d",
+            group->id, static_cast<int>(expected), static_cast<int>(one_way), static_cast<int>(two_way));
+        wccp_alarm_raise_alarm(group, WCCP_ALARM_ADJACENCY);
+    } else if (healthy) {
+        QV_LOG(LC_LOG_INFO,
+               "WCCP GRP %d: alarm: router verification is ok. configured: %d one-way: %d two-way: %d",
+               group->id, static_cast<int>(expected), static_cast<int>(one_way), static_cast<int>(two_way));
+    }
+    return 0;
+}
+
+static bool is_without_its_share(const wccp_rtr_view_appliance *entry) {
+    return entry->buckets_assigned == 0 && entry->weight != 0;
+}
+
+// What the designated appliance asked for, against what each router reports.
+static bool routers_carry_out_our_table(wccp_service_group *group) {
+    for (uint32_t i = 0; i < WCCP_MAX_APPLIANCES; i++) {
+        const wccp_dsg_appliance *asked = &group->dsg_appliances[i];
+        if (asked->assigned == 0)
+            continue;
+        for (wccp_sending_router *router = group->sending_routers; router; router = router->next) {
+            uint32_t buckets = 0;
+            wccp_get_router_assignment(group, router, asked->ipa, &buckets);
+            QV_LOG(LC_LOG_INFO,
+                   "WCCP GRP %d: alarm: verify allocation. appliance %s buckets dsg: %d router %s %d",
+                   group->id, addr_text(asked->ipa).s, asked->assigned, addr_text(router->router_id).s,
+                   static_cast<int>(buckets));
+            if (buckets == asked->assigned)
+                continue;
+            QV_LOG(LC_LOG_WARNING,
+                   "WCCP GRP %d: alarm: allocation mismatch. appliance %s buckets dsg: %d router %s %d",
+                   group->id, addr_text(asked->ipa).s, asked->assigned, addr_text(router->router_id).s,
+                   static_cast<int>(buckets));
+            return false;
+        }
+    }
+    for (const wccp_sending_router *router = group->sending_routers; router; router = router->next) {
+        for (uint32_t i = 0; i < router->view_appliance_count; i++) {
+            const wccp_rtr_view_appliance *entry = &router->view_appliances[i];
+            if (!is_without_its_share(entry))
+                continue;
+            QV_LOG(LC_LOG_WARNING,
+                   "WCCP GRP %d: alarm: allocation mismatch. appliance %s weight : %d router %s buckets : %d",
+                   group->id, addr_text(entry->ipa).s, entry->weight, addr_text(router->router_id).s,
+                   entry->buckets_assigned);
+            return false;
+        }
+    }
+    return true;
+}
+
+// Any other appliance looks only for holes.
+static bool routers_redirect_without_holes(wccp_service_group *group) {
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: verify by non-designator.", group->id);
+    for (const wccp_sending_router *router = group->sending_routers; router; router = router->next) {
+        bool redirects = false;
+        for (uint32_t i = 0; i < router->view_appliance_count; i++) {
+            const wccp_rtr_view_appliance *entry = &router->view_appliances[i];
+            redirects |= entry->buckets_assigned != 0;
+            if (!is_without_its_share(entry))
+                continue;
+            QV_LOG(LC_LOG_WARNING,
+                   "WCCP GRP %d: alarm: router %s is not redirecting to appliance (%s weight %d)", group->id,
+                   addr_text(router->router_id).s, addr_text(entry->ipa).s, entry->weight);
+            return false;
+        }
+        if (!redirects) {
+            QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: alarm: router %s is not redirecting to ANY appliance.",
+                   group->id, addr_text(router->router_id).s);
+            return false;
+        }
+    }
+    return true;
+}
+
+int wccp_alarms_verify_allocation_table(wccp_service_group *group) {
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: verify assignment table.", group->id);
+    const bool in_order =
+        group->designated == 1 ? routers_carry_out_our_table(group) : routers_redirect_without_holes(group);
+    const bool raised = stands(group, WCCP_ALARM_ASSIGNMENT);
+    if (in_order && raised)
+        wccp_alarm_clear_alarm(group, WCCP_ALARM_ASSIGNMENT);
+    else if (!in_order && !raised)
+        wccp_alarm_raise_alarm(group, WCCP_ALARM_ASSIGNMENT);
+    return 0;
+}
