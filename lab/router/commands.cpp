@@ -1,0 +1,244 @@
+// What a router can be told while it runs, one row a command: its words, and what they do to the machine.
+#include "lab/router/router.h"
+
+#include <algorithm>
+#include <charconv>
+
+namespace lab {
+
+const char *const ROUTER_COMMANDS =
+    "[@ROUTER] COMMAND...   for one router, or for all\n"
+    "  show                       the whole state, as JSON\n"
+    "  owners SERVICE             owner of each bucket or value, on one line\n"
+    "  stop | resume              say and hear nothing | go on\n"
+    "  ignore ADDRESS | heed ADDRESS     hear nothing of one appliance\n"
+    "  forget ADDRESS             drop an appliance at once\n"
+    "  query ADDRESS              send a Removal Query\n"
+    "  assign SERVICE FIRST LAST ADDRESS|none   give these buckets or values to another\n"
+    "  list ROUTER | unlist ROUTER       report a router that is not there\n"
+    "  offer FORWARD ASSIGN RETURN       words as on the command line\n"
+    "  nexus | ios                the form of its views\n"
+    "  password [TEXT]            of its messages; none without a text\n"
+    "  fault NAME [TIMES|always]  spoil the next I-See-You messages; fault none\n"
+    "  raw HEX [ADDRESS]          send these bytes, to all appliances or to one\n";
+
+struct command_call {
+    router *self;
+    double now;
+    const std::vector<std::string> &words;
+    output *out;
+};
+
+static const std::string BAD_ADDRESS = "error: that is no address";
+
+// For each group that knows the appliance of the first argument.
+static std::string for_appliance(const command_call &call,
+                                 void (*act)(const command_call &, group *, address)) {
+    const auto id = address_of(call.words[1]);
+    if (!id)
+        return BAD_ADDRESS;
+    size_t found = 0;
+    for (auto &[number, in] : call.self->groups) {
+        if (!in.members.contains(*id))
+            continue;
+        act(call, &in, *id);
+        found++;
+    }
+    return found ? "ok" : "error: no such appliance";
+}
+
+static std::string do_forget(const command_call &call) {
+    return for_appliance(call, [](const command_call &inner, group *in, address id) {
+        drop_member(inner.self, in, id, inner.now, "forgotten", inner.out);
+    });
+}
+
+static std::string do_query(const command_call &call) {
+    return for_appliance(call, [](const command_call &inner, group *in, address id) {
+        send_query(inner.self, in, &in->members[id], inner.now, inner.out);
+        in->members[id].queried = false; // one more comes when its time has come
+    });
+}
+
+static std::string do_deaf(const command_call &call) {
+    const auto id = address_of(call.words[1]);
+    if (!id)
+        return BAD_ADDRESS;
+    if (call.words[0] == "ignore")
+        call.self->deaf_to.insert(*id);
+    else
+        call.self->deaf_to.erase(*id);
+    return "ok";
+}
+
+static std::string do_stop(const command_call &call) {
+    call.self->stopped = call.words[0] == "stop";
+    return "ok";
+}
+
+static std::string do_list(const command_call &call) {
+    const auto id = address_of(call.words[1]);
+    if (!id)
+        return BAD_ADDRESS;
+    for (auto &[number, in] : call.self->groups) {
+        if (call.words[0] == "list")
+            in.listed.insert(*id);
+        else
+            in.listed.erase(*id);
+        refresh_router_view(call.self, &in, call.now, call.out);
+    }
+    return "ok";
+}
+
+static std::string do_form(const command_call &call) {
+    call.self->options.nexus = call.words[0] == "nexus";
+    return "ok";
+}
+
+static std::string do_password(const command_call &call) {
+    call.self->options.password = call.words.size() > 1 ? call.words[1] : "";
+    return "ok";
+}
+
+static std::optional<uint32_t> number_of(const std::string &text) {
+    uint32_t value = 0;
+    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
+    if (error != std::errc() || end != text.data() + text.size())
+        return std::nullopt;
+    return value;
+}
+
+static group *find_group(const command_call &call) {
+    const auto id = number_of(call.words[1]);
+    if (!id || *id > 255)
+        return nullptr;
+    const auto place = call.self->groups.find(static_cast<uint8_t>(*id));
+    return place == call.self->groups.end() ? nullptr : &place->second;
+}
+
+static std::vector<address *> owners_of(group *in) {
+    std::vector<address *> owners;
+    if (in->current.by == kind::hash)
+        for (address &owner : in->current.buckets)
+            owners.push_back(&owner);
+    for (mask_set &set : in->current.sets)
+        for (mask_value &value : set.values)
+            owners.push_back(&value.owner);
+    return owners;
+}
+
+static std::string do_owners(const command_call &call) {
+    group *in = find_group(call);
+    if (!in)
+        return "none";
+    const char *kinds[] = {"none", "hash", "mask"};
+    std::string line = kinds[static_cast<int>(in->current.by)];
+    line += " " + text_of(in->current.key) + " " + std::to_string(in->current.key_change);
+    for (const address *owner : owners_of(in))
+        line += " " + (*owner ? text_of(*owner) : std::string("-"));
+    return line;
+}
+
+static std::string do_assign(const command_call &call) {
+    group *in = find_group(call);
+    const auto first = number_of(call.words[2]), last = number_of(call.words[3]);
+    const auto owner = call.words[4] == "none" ? std::optional<address>(0) : address_of(call.words[4]);
+    if (!in || !first || !last || !owner)
+        return "error: assign SERVICE FIRST LAST ADDRESS";
+    const auto owners = owners_of(in);
+    if (*first > *last || *last >= owners.size())
+        return "error: there are " + std::to_string(owners.size()) + " to assign";
+    for (uint32_t i = *first; i <= *last; i++)
+        *owners[i] = *owner;
+    return "ok";
+}
+
+static std::string do_offer(const command_call &call) {
+    methods offer = {0, 0, 0};
+    uint32_t *const sets[] = {&offer.forward, &offer.assign, &offer.giveback};
+    for (size_t i = 0; i < 3; i++) {
+        const std::string &word = call.words[i + 1];
+        const bool assign = i == 1;
+        if (word.find(assign ? "hash" : "gre") != std::string::npos)
+            *sets[i] |= 1;
+        if (word.find(assign ? "mask" : "l2") != std::string::npos)
+            *sets[i] |= 2;
+    }
+    call.self->options.offer = offer;
+    return "ok";
+}
+
+static std::string do_fault(const command_call &call) {
+    const std::string &name = call.words[1];
+    if (name == "none") {
+        call.self->fault_left = 0;
+        return "ok";
+    }
+    if (!is_fault(name))
+        return "error: faults are " + fault_names();
+    const std::string times = call.words.size() > 2 ? call.words[2] : "1";
+    const auto number = number_of(times);
+    if (times != "always" && (!number || *number > 1000000))
+        return "error: how often?";
+    call.self->fault = name;
+    call.self->fault_left = times == "always" ? -1 : static_cast<int>(*number);
+    return "ok";
+}
+
+static std::string do_raw(const command_call &call) {
+    bytes data;
+    const std::string &hex = call.words[1];
+    for (size_t i = 0; i + 1 < hex.size(); i += 2) {
+        uint8_t value = 0;
+        if (std::from_chars(&hex[i], &hex[i] + 2, value, 16).ptr != &hex[i] + 2)
+            return "error: that is no hex";
+        data.push_back(value);
+    }
+    std::set<address> to;
+    if (call.words.size() > 2) {
+        const auto one = address_of(call.words[2]);
+        if (!one)
+            return BAD_ADDRESS;
+        to.insert(*one);
+    } else {
+        for (const auto &[number, in] : call.self->groups)
+            for (const auto &[id, one] : in.members)
+                to.insert(one.source);
+    }
+    for (const address one : to)
+        call.out->send.push_back({one, data});
+    return "ok";
+}
+
+static std::string do_show(const command_call &call) {
+    return router_state(*call.self, call.now).dump();
+}
+
+struct command_row {
+    const char *name;
+    size_t least, most; // words with the name
+    std::string (*act)(const command_call &call);
+};
+constexpr command_row COMMANDS[] = {
+    {"show", 1, 1, do_show},     {"owners", 2, 2, do_owners}, {"stop", 1, 1, do_stop},
+    {"resume", 1, 1, do_stop},   {"ignore", 2, 2, do_deaf},   {"heed", 2, 2, do_deaf},
+    {"forget", 2, 2, do_forget}, {"query", 2, 2, do_query},   {"assign", 5, 5, do_assign},
+    {"list", 2, 2, do_list},     {"unlist", 2, 2, do_list},   {"offer", 4, 4, do_offer},
+    {"nexus", 1, 1, do_form},    {"ios", 1, 1, do_form},      {"password", 1, 2, do_password},
+    {"fault", 2, 3, do_fault},   {"raw", 2, 3, do_raw},
+};
+
+std::string router_command(router *self, double now, const std::vector<std::string> &words, output *out) {
+    if (words.empty())
+        return "error: nothing to do";
+    for (const command_row &row : COMMANDS) {
+        if (words[0] != row.name)
+            continue;
+        if (words.size() < row.least || words.size() > row.most)
+            return "error: too few or too many words";
+        return row.act({self, now, words, out});
+    }
+    return std::string("error: no such command\n") + ROUTER_COMMANDS;
+}
+
+} // namespace lab

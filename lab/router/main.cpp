@@ -1,0 +1,323 @@
+// wccp_router: one or many simulated routers, each on an address of its own.
+//
+// This file has the sockets, the clock and the operator's words; what a router does is in router.cpp. One
+// thread, one poll: a socket bound to each router's address, one more per router for the multicast address,
+// the control socket, standard input, and signals by descriptor.
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <sys/signalfd.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+#include <ctime>
+#include <iterator>
+#include <sstream>
+
+#include <CLI/CLI.hpp>
+
+#include "lab/router/router.h"
+#include "lab/router/tools.h"
+
+using namespace lab;
+
+constexpr uint16_t PORT = 2048;
+constexpr int TICK_MS = 200;
+
+struct station {
+    router machine;
+    int unicast = -1;
+    int multicast = -1;
+};
+struct lab_process {
+    std::vector<station> stations;
+    bool as_json = false;
+    double began = 0;
+};
+
+static double seconds_now() {
+    timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+}
+
+static sockaddr_in place_of(address where) {
+    sockaddr_in place = {};
+    place.sin_family = AF_INET;
+    place.sin_port = htons(PORT);
+    place.sin_addr.s_addr = htonl(where);
+    return place;
+}
+
+static int open_socket(address where) {
+    const int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+    const int one = 1;
+    const sockaddr_in place = place_of(where);
+    if (fd < 0 || setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one) != 0 ||
+        bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0) {
+        fprintf(stderr, "wccp_router: %s: %s\n", text_of(where).c_str(), strerror(errno));
+        exit(1);
+    }
+    return fd;
+}
+
+static void open_station(station *one) {
+    const router_options &options = one->machine.options;
+    one->unicast = open_socket(options.self);
+    if (options.group == 0)
+        return;
+    one->multicast = open_socket(options.group);
+    const in_addr self = {htonl(options.self)};
+    const ip_mreq membership = {{htonl(options.group)}, self};
+    const uint8_t ttl = 5, off = 0;
+    if (setsockopt(one->multicast, IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof membership) != 0 ||
+        setsockopt(one->unicast, IPPROTO_IP, IP_MULTICAST_IF, &self, sizeof self) != 0 ||
+        setsockopt(one->unicast, IPPROTO_IP, IP_MULTICAST_TTL, &ttl, sizeof ttl) != 0 ||
+        setsockopt(one->unicast, IPPROTO_IP, IP_MULTICAST_LOOP, &off, sizeof off) != 0) {
+        fprintf(stderr, "wccp_router: multicast on %s: %s\n", text_of(options.self).c_str(), strerror(errno));
+        exit(1);
+    }
+}
+
+static void carry_out(const lab_process &all, station *one, const output &out) {
+    for (const datagram &packet : out.send) {
+        const sockaddr_in place = place_of(packet.to);
+        if (sendto(one->unicast, packet.data.data(), packet.data.size(), 0,
+                   reinterpret_cast<const sockaddr *>(&place), sizeof place) < 0)
+            count(&one->machine, "tx_failures");
+    }
+    for (const json &event : out.events)
+        puts((all.as_json ? event.dump() : event_line(event)).c_str());
+    if (!out.events.empty())
+        fflush(stdout);
+}
+
+static void receive_from(const lab_process &all, station *one, int fd, address to) {
+    for (;;) {
+        uint8_t data[65536];
+        sockaddr_in place = {};
+        socklen_t length = sizeof place;
+        const ssize_t got = recvfrom(fd, data, sizeof data, 0, reinterpret_cast<sockaddr *>(&place), &length);
+        if (got < 0)
+            return;
+        output out;
+        router_receive(&one->machine, seconds_now() - all.began, ntohl(place.sin_addr.s_addr), to,
+                       bytes(data, data + got), &out);
+        carry_out(all, one, out);
+    }
+}
+
+static std::string run_command(lab_process *all, const std::string &line) {
+    std::istringstream in(line);
+    std::vector<std::string> words{std::istream_iterator<std::string>(in), {}};
+    std::optional<address> only;
+    if (!words.empty() && words[0].starts_with('@')) {
+        only = address_of(words[0].substr(1));
+        words.erase(words.begin());
+        if (!only)
+            return "error: that is no address\n";
+    }
+    std::string answers;
+    for (station &one : all->stations) {
+        if (only && one.machine.options.self != *only)
+            continue;
+        output out;
+        const std::string answer = router_command(&one.machine, seconds_now() - all->began, words, &out);
+        carry_out(*all, &one, out);
+        answers += answer + "\n";
+        if (answer.starts_with("error:"))
+            return answer + "\n";
+    }
+    return answers.empty() ? "error: no such router\n" : answers;
+}
+
+static void serve_control(lab_process *all, int listener) {
+    const int fd = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
+    if (fd < 0)
+        return;
+    const timeval patience = {1, 0};
+    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+    setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
+    std::string line;
+    char part[512];
+    while (line.find('\n') == std::string::npos && line.size() < 65536) {
+        const ssize_t got = read(fd, part, sizeof part);
+        if (got <= 0)
+            break;
+        line.append(part, static_cast<size_t>(got));
+    }
+    const std::string answer = run_command(all, line);
+    for (size_t sent = 0; sent < answer.size();) {
+        const ssize_t went = send(fd, answer.data() + sent, answer.size() - sent, MSG_NOSIGNAL);
+        if (went <= 0)
+            break;
+        sent += static_cast<size_t>(went);
+    }
+    close(fd);
+}
+
+static int open_signals() {
+    sigset_t set;
+    sigemptyset(&set);
+    for (const int number : {SIGTERM, SIGINT, SIGHUP, SIGUSR1})
+        sigaddset(&set, number);
+    sigprocmask(SIG_BLOCK, &set, nullptr);
+    return signalfd(-1, &set, SFD_CLOEXEC | SFD_NONBLOCK);
+}
+
+static void run(lab_process *all, int control) {
+    const int signals = open_signals();
+    std::string typed;
+    std::vector<pollfd> fds = {{signals, POLLIN, 0}, {control, POLLIN, 0}, {STDIN_FILENO, POLLIN, 0}};
+    for (const station &one : all->stations) {
+        fds.push_back({one.unicast, POLLIN, 0});
+        fds.push_back({one.multicast, POLLIN, 0});
+    }
+    for (;;) {
+        (void)poll(fds.data(), fds.size(), TICK_MS);
+        if (fds[0].revents) {
+            signalfd_siginfo info;
+            if (read(signals, &info, sizeof info) == sizeof info) {
+                if (info.ssi_signo != SIGUSR1)
+                    return;
+                fputs(run_command(all, "show").c_str(), stdout);
+                fflush(stdout);
+            }
+        }
+        if (fds[1].revents)
+            serve_control(all, control);
+        if (fds[2].revents) {
+            char part[512];
+            const ssize_t got = read(STDIN_FILENO, part, sizeof part);
+            if (got <= 0)
+                fds[2].fd = -1;
+            else
+                typed.append(part, static_cast<size_t>(got));
+            for (size_t end; (end = typed.find('\n')) != std::string::npos; typed.erase(0, end + 1)) {
+                if (typed.starts_with("quit"))
+                    return;
+                fputs(run_command(all, typed.substr(0, end)).c_str(), stdout);
+                fflush(stdout);
+            }
+        }
+        for (size_t i = 0; i < all->stations.size(); i++) {
+            station &one = all->stations[i];
+            if (fds[3 + 2 * i].revents)
+                receive_from(*all, &one, one.unicast, one.machine.options.self);
+            if (fds[4 + 2 * i].revents)
+                receive_from(*all, &one, one.multicast, one.machine.options.group);
+            output out;
+            router_tick(&one.machine, seconds_now() - all->began, &out);
+            carry_out(*all, &one, out);
+        }
+    }
+}
+
+// "gre,l2" and "hash,mask" as bits.
+static uint32_t bits_of(const std::vector<std::string> &words, const char *first, const char *second) {
+    uint32_t bits = 0;
+    for (const std::string &word : words)
+        bits |= word == first ? 1U : word == second ? 2U : 0U;
+    return bits;
+}
+
+int main(int argc, char **argv) {
+    CLI::App app("simulated WCCP version 2 routers");
+    app.footer(std::string("Commands on standard input or through --control:\n") + ROUTER_COMMANDS);
+    app.require_subcommand(0, 1);
+    std::vector<std::string> routers, forward = {"gre", "l2"}, giveback = {"gre", "l2"},
+                                      assign = {"hash", "mask"};
+    std::vector<uint16_t> services;
+    std::string form = "ios", multicast, reply = "group", join = "echo", control_path;
+    router_options options;
+    lab_process all;
+    app.add_option("--router", routers, "address of a router; may come often")->delimiter(',');
+    app.add_option("--form", form, "of the views")->check(CLI::IsMember({"ios", "nexus"}));
+    app.add_option("--forward", forward, "methods offered")
+        ->delimiter(',')
+        ->check(CLI::IsMember({"gre", "l2"}));
+    app.add_option("--return", giveback, "methods offered")
+        ->delimiter(',')
+        ->check(CLI::IsMember({"gre", "l2"}));
+    app.add_option("--assign", assign, "methods offered")
+        ->delimiter(',')
+        ->check(CLI::IsMember({"hash", "mask"}));
+    app.add_option("--password", options.password, "sign with MD5");
+    app.add_option("--service", services, "service ids served (default: any)")
+        ->delimiter(',')
+        ->check(CLI::Range(0, 255));
+    app.add_option("--group", multicast, "multicast address to listen to");
+    app.add_option("--reply", reply, "where to, for what came by multicast")
+        ->check(CLI::IsMember({"group", "unicast"}));
+    app.add_option("--join", join,
+                   "when an appliance enters the view: at its first Here-I-Am, or once it has "
+                   "echoed a receive id")
+        ->check(CLI::IsMember({"first", "echo"}));
+    app.add_option("--query-after", options.query_after, "seconds of silence before a Removal Query");
+    app.add_option("--drop-after", options.drop_after, "seconds of silence before an appliance is dropped");
+    app.add_option("--control", control_path, "unix socket for commands");
+    app.add_flag("--json", all.as_json, "one JSON object per message");
+
+    std::string log_file, socket_path;
+    std::vector<std::string> command;
+    CLI::App *logd = app.add_subcommand("logd", "a log daemon on /dev/log");
+    logd->add_option("FILE", log_file, "where lines go; - for standard output")->required();
+    CLI::App *ctl = app.add_subcommand("ctl", "send one command to a control socket");
+    ctl->add_option("SOCKET", socket_path)->required();
+    ctl->add_option("COMMAND", command)->required();
+    CLI11_PARSE(app, argc, argv);
+
+    if (*logd)
+        return run_logd(log_file);
+    if (*ctl) {
+        std::string line;
+        for (const std::string &word : command)
+            line += (line.empty() ? "" : " ") + word;
+        return run_ctl(socket_path, line);
+    }
+    options.nexus = form == "nexus";
+    options.offer = {bits_of(forward, "gre", "l2"), bits_of(assign, "hash", "mask"),
+                     bits_of(giveback, "gre", "l2")};
+    options.reply_to_group = reply == "group";
+    options.join_at_first = join == "first";
+    for (const uint16_t id : services)
+        options.services.insert(static_cast<uint8_t>(id));
+    if (!multicast.empty()) {
+        const auto group = address_of(multicast);
+        if (!group || *group >> 28 != 0xe) {
+            fprintf(stderr, "wccp_router: %s is no multicast address\n", multicast.c_str());
+            return 2;
+        }
+        options.group = *group;
+    }
+    for (const std::string &text : routers) {
+        const auto self = address_of(text);
+        if (!self) {
+            fprintf(stderr, "wccp_router: %s is no address\n", text.c_str());
+            return 2;
+        }
+        options.self = *self;
+        station one;
+        one.machine.options = options;
+        open_station(&one);
+        all.stations.push_back(std::move(one));
+    }
+    if (all.stations.empty()) {
+        fputs("wccp_router: no --router\n", stderr);
+        return 2;
+    }
+    const int control = control_path.empty() ? -1 : listen_at(control_path);
+    if (!control_path.empty() && control < 0) {
+        fprintf(stderr, "wccp_router: %s: %s\n", control_path.c_str(), strerror(errno));
+        return 1;
+    }
+    all.began = seconds_now();
+    run(&all, control);
+    if (control >= 0)
+        unlink(control_path.c_str());
+    return 0;
+}
