@@ -1,0 +1,60 @@
+// Interest lists: what a library wants to be told about descriptors and timers, told to whatever loop stands
+// behind the list by one change callback. A list has no lock of its own; its user's lock guards it.
+#pragma once
+
+#include <cstdint>
+
+#include "runtime/common.h"
+
+// Why an interest function is called.
+enum : uint32_t {
+    FDIC_READABLE = 1,
+    FDIC_WRITABLE = 2,
+    FDIC_TIMER_EXPIRED = 3,
+    FDIC_FD_OPENED = 4,
+    FDIC_FD_CLOSED = 5,
+};
+using fdic_handler = lc_status (*)(int fd, uint32_t kind, void *user_data, void *argument);
+
+struct fdic;
+struct fdic_event {
+    fdic *context;
+    uint32_t id; // 0 is invalid
+    int32_t active;
+    int32_t has_fd;
+    int32_t fd;
+    void *user_data;
+    int32_t want_read, want_write;
+    fdic_handler read_function;
+    void *read_argument;
+    fdic_handler write_function;
+    void *write_argument;
+    int32_t has_timer;
+    int64_t delay; // milliseconds; -1: not armed
+    fdic_handler timer_function;
+    void *timer_argument;
+};
+
+// Sorted by id. Freed by whoever asked for it.
+struct fdic_event_array;
+lc_status fdic_event_array_free(fdic_event_array **inout);
+uint32_t fdic_event_array_length_quick(const fdic_event_array *array);
+fdic_event *fdic_event_array_get_quick(const fdic_event_array *array, uint32_t index);
+lc_status fdic_event_array_duplicate(const fdic_event_array *array, fdic_event_array **out);
+
+// The changes stay the list's; they are freed when the callback returns.
+using fdic_change_callback = lc_status (*)(const fdic_event_array *changes, void *user_data);
+
+lc_status fdic_init(fdic **out, fdic_change_callback callback, void *user_data);
+lc_status fdic_deinit(fdic **inout);
+lc_status fdic_event_add_fd(fdic *context, int32_t fd, int32_t want_read, int32_t want_write, void *user_data,
+                            fdic_handler read_function, void *read_argument, fdic_handler write_function,
+                            void *write_argument, int32_t *out_id);
+lc_status fdic_event_update_fd(fdic *context, int32_t id, int32_t want_read, int32_t want_write);
+lc_status fdic_event_delete_fd(fdic *context, int32_t id);
+lc_status fdic_event_add_timer(fdic *context, int64_t delay_ms, void *user_data, fdic_handler timer_function,
+                               void *timer_argument, int32_t *out_id);
+lc_status fdic_event_update_timer(fdic *context, int32_t id, int64_t delay_ms);
+lc_status fdic_event_delete_timer(fdic *context, int32_t id);
+// A copy of every record.
+lc_status fdic_events_query(fdic *context, fdic_event_array **out);
