@@ -1,0 +1,218 @@
+// Sending routers: the capability decision, creation and its limits, removal, and Removal Queries.
+#include "engine/wccp_router_utils.h"
+
+#include <cstring>
+#include <memory>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "engine/wccp_state.h"
+#include "tests/support/reported_group.h"
+
+namespace {
+
+struct RouterTest : testing::Test {
+    ~RouterTest() override {
+        wccp_g.seconds = 0;
+        shared.reset();
+        EXPECT_EQ(wccp_g.stat_allocs.load(), wccp_g.stat_frees.load());
+    }
+    // The agreed codes as one number, forwarding first; minus one minus the result where there is no
+    // agreement.
+    int decide(uint32_t forwarding, uint32_t assignment, uint32_t ret) {
+        const wccp_rtr_capabilities offered = {forwarding, assignment, ret};
+        wccp_rtr_capabilities agreed = {7, 7, 7};
+        uint32_t compatible = 7;
+        const int result = wccp_process_router_capabilities(group, ROUTER_A, &offered, &agreed, &compatible);
+        if (!compatible)
+            return -1 - result;
+        EXPECT_EQ(result, 0);
+        EXPECT_EQ(compatible, 1u);
+        return static_cast<int>(agreed.forwarding * 100 + agreed.assignment * 10 + agreed.ret);
+    }
+    void configure(uint32_t forwarding, uint32_t assignment) {
+        group->cfg_fwd_method = forwarding;
+        group->cfg_assign_method = assignment;
+    }
+    std::unique_ptr<reported_group> shared = std::make_unique<reported_group>(false);
+    wccp_service_group *group = shared->group;
+};
+
+TEST_F(RouterTest, EachMethodIsAgreedByItsOwnRule) {
+    // By local value and the two low bits of the offer; 0 for none in common.
+    const int forwarding[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 2}, {0, 0, 0, 0}};
+    const int assign_with_gre[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 1}, {0, 0, 0, 0}};
+    const int assign_with_l2[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 2}, {0, 0, 0, 0}};
+    const int returning[4] = {0, 1, 2, 1}; // the configuration has no say
+    for (uint32_t local = 0; local < 25; local++) {
+        const uint32_t local_fwd = local / 5, local_assign = local % 5;
+        configure(local_fwd, local_assign);
+        for (uint32_t offer = 0; offer < 64; offer++) {
+            const uint32_t fwd = offer & 3, assign = offer >> 2 & 3, ret = offer >> 4;
+            const int f = forwarding[local_fwd][fwd];
+            const int a = (f == 2 ? assign_with_l2 : assign_with_gre)[local_assign][assign];
+            const int r = returning[ret];
+            const int expected = f == 0 || a == 0 ? -1 : r == 0 ? -2 : f * 100 + a * 10 + r;
+            ASSERT_EQ(decide(fwd, assign, ret), expected);
+            ASSERT_EQ(decide(fwd | 0xfffffffc, assign | 0x100, ret | 4), expected);
+        }
+    }
+}
+
+TEST_F(RouterTest, WhatTheFirstRouterAgreedHoldsForAll) {
+    configure(WCCP_METHOD_EITHER, WCCP_ASSIGN_EITHER);
+    EXPECT_EQ(decide(3, 3, 3), 221);
+    EXPECT_EQ(decide(1, 3, 3), 111);
+    shared->router(ROUTER_A); // L2, hash, L2
+    EXPECT_EQ(group->fwd_method * 100 + group->assign_method * 10 + group->ret_method, 212u);
+    EXPECT_EQ(decide(1, 3, 3), -1);
+    EXPECT_EQ(decide(2, 2, 3), -1);
+    EXPECT_EQ(decide(2, 3, 1), -2);
+    EXPECT_EQ(decide(3, 3, 3), 212);
+    configure(WCCP_METHOD_GRE, WCCP_ASSIGN_MASK);
+    EXPECT_EQ(decide(3, 3, 3), 212);
+    wccp_g.seconds += 40;
+    wccp_monitor_sending_routers(group);
+    EXPECT_EQ(group->fwd_method + group->assign_method + group->ret_method, 0u);
+    EXPECT_EQ(decide(3, 3, 3), 121);
+}
+
+TEST_F(RouterTest, ANewRouterIsOneWayAndKeepsItsOffer) {
+    wccp_g.seconds = 77;
+    const wccp_rtr_capabilities offered = {0x1fe, 0x302, 2}, agreed = {2, 2, 2};
+    const wccp_sending_router *router = wccp_create_sending_router(group, ROUTER_A, &offered, &agreed);
+    ASSERT_NE(router, nullptr);
+    EXPECT_EQ(router->cap_fwd, 0xfe);
+    EXPECT_EQ(router->cap_assign, 2);
+    EXPECT_EQ(router->flags, WCCP_RTR_ONE_WAY);
+    EXPECT_EQ(router->state_time, 77u);
+    EXPECT_EQ(group->assign_method, 2u);
+    EXPECT_EQ(group->router_alarm_timer.countdown, 60u);
+    EXPECT_EQ(wccp_find_sending_router(group, ROUTER_A), router);
+    EXPECT_EQ(wccp_find_sending_router(group, ROUTER_B), nullptr);
+}
+
+TEST_F(RouterTest, NoRecordForRouterZeroForThe33rdOrWithoutATunnel) {
+    const wccp_rtr_capabilities l2 = {2, 1, 2};
+    EXPECT_EQ(wccp_create_sending_router(group, {}, &l2, &l2), nullptr);
+    // There is no tunneld to ask.
+    for (const wccp_rtr_capabilities &gre : {wccp_rtr_capabilities{1, 1, 2}, wccp_rtr_capabilities{2, 1, 1}})
+        EXPECT_EQ(wccp_create_sending_router(group, ROUTER_A, &gre, &gre), nullptr);
+    EXPECT_EQ(group->sending_router_count, 0u);
+    EXPECT_FALSE(group->state_flags & WCCP_CAPABILITIES_SET);
+    for (uint32_t i = 1; i <= 32; i++)
+        ASSERT_NE(wccp_create_sending_router(group, host(i), &l2, &l2), nullptr);
+    EXPECT_EQ(wccp_create_sending_router(group, host(33), &l2, &l2), nullptr);
+    EXPECT_EQ(group->sending_router_count, 32u);
+}
+
+TEST_F(RouterTest, SilenceCountsAcrossTheWrapOfTheClock) {
+    wccp_g.seconds = 0xfffffff0;
+    shared->router(ROUTER_A);
+    wccp_g.seconds += 39;
+    wccp_monitor_sending_routers(group);
+    EXPECT_EQ(group->sending_router_count, 1u);
+    wccp_g.seconds += 1;
+    wccp_monitor_sending_routers(group);
+    EXPECT_EQ(group->sending_router_count, 0u);
+}
+
+TEST_F(RouterTest, ARemovalTakesItsMentionsItsShareAndLastTheAgreement) {
+    for (const be32 id : {ROUTER_A, ROUTER_B, ROUTER_C})
+        shared->see(id, {id, ROUTER_A}, {{US, 100}, {id, 100}});
+    shared->router(ROUTER_A)->self_buckets = 10;
+    shared->router(ROUTER_B)->self_buckets = 10;
+    group->redirecting_routers = 2;
+    wccp_appliance_state_active(group);
+    const uint32_t change_number = group->change_number;
+
+    wccp_g.seconds = 40;
+    shared->router(ROUTER_B)->last_icu_time = 20;
+    shared->router(ROUTER_C)->last_icu_time = 40;
+    wccp_monitor_sending_routers(group);
+    EXPECT_EQ(group->sending_router_count, 2u);
+    EXPECT_EQ(group->change_number, change_number + 1);
+    EXPECT_TRUE(group->state_flags & WCCP_DESG_ELECT_PENDING);
+    EXPECT_EQ(group->router_view_count, 3u); // A is still named by the others
+    EXPECT_EQ(group->appliance_view_count, 3u);
+    EXPECT_EQ(group->redirecting_routers, 1);
+    EXPECT_TRUE(group->state_flags & WCCP_STATE_ACTIVE);
+    EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ADJACENCY);
+
+    wccp_g.seconds = 60;
+    shared->router(ROUTER_C)->last_icu_time = 60;
+    wccp_monitor_sending_routers(group); // the last one that redirected here
+    EXPECT_EQ(group->redirecting_routers, 0);
+    EXPECT_TRUE(group->state_flags & WCCP_STATE_INIT);
+    EXPECT_TRUE(group->state_flags & WCCP_CAPABILITIES_SET);
+
+    wccp_g.seconds = 100;
+    wccp_monitor_sending_routers(group);
+    EXPECT_EQ(group->router_view, nullptr);
+    EXPECT_EQ(group->appliance_view, nullptr);
+    EXPECT_EQ(group->router_view_count + group->appliance_view_count + group->sending_router_count, 0u);
+    EXPECT_FALSE(group->state_flags & WCCP_CAPABILITIES_SET);
+    EXPECT_EQ(group->routers_timed_out, 3u);
+}
+
+TEST_F(RouterTest, AQueryIsAnsweredThreeTimesWithTheSameBytes) {
+    shared->router(ROUTER_A);
+    EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_B, host(77)), 0); // not known
+    EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_A, host(77)), 0); // one-way
+    EXPECT_EQ(group->removal_reply_count, 0u);
+    EXPECT_TRUE(is_zero(shared->router(ROUTER_A)->receive_id));
+
+    shared->see(ROUTER_A, {ROUTER_A}, {{US, 100}});
+    EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_A, host(77)), 0);
+    EXPECT_EQ(shared->router(ROUTER_A)->receive_id, host(77));
+    ASSERT_EQ(group->removal_reply_count, 1u);
+    const wccp_removal_reply *reply = group->removal_replies;
+    EXPECT_EQ(reply->pkt.ipa, ROUTER_A);
+    EXPECT_NE(memmem(reply->pkt.data, reply->pkt.length, host(77).bytes, 4), nullptr);
+    const std::vector<uint8_t> bytes(reply->pkt.data, reply->pkt.data + reply->pkt.length);
+    for (int tick = 1; tick <= 3; tick++) {
+        ASSERT_EQ(group->removal_reply_count, 1u);
+        EXPECT_EQ(memcmp(reply->pkt.data, bytes.data(), bytes.size()), 0);
+        EXPECT_EQ(reply->pkt.length, bytes.size());
+        shared->see(ROUTER_A, {ROUTER_A, host(200 + static_cast<uint32_t>(tick))}, {{US, 100}});
+        pass_seconds(1);
+        EXPECT_EQ(group->tx_removal_replies, static_cast<uint32_t>(tick));
+    }
+    EXPECT_EQ(group->removal_reply_count, 0u);
+    EXPECT_EQ(group->removal_replies, nullptr);
+    pass_seconds(1);
+    EXPECT_EQ(group->tx_removal_replies, 3u);
+}
+
+TEST_F(RouterTest, QuestionsAboutRouters) {
+    uint32_t one_way = 9, two_way = 9, buckets = 9;
+    EXPECT_EQ(wccp_get_router_connection_stats(nullptr, &one_way, &two_way), 1);
+    EXPECT_EQ(wccp_get_router_connection_stats(group, nullptr, &two_way), 1);
+    EXPECT_EQ(wccp_get_router_connection_stats(group, &one_way, nullptr), 1);
+    EXPECT_EQ(wccp_get_router_connection_stats(group, &one_way, &two_way), 0);
+    EXPECT_EQ(one_way + two_way, 0u);
+    shared->router(ROUTER_A)->flags = WCCP_RTR_ONE_WAY | WCCP_RTR_TWO_WAY;
+    shared->router(ROUTER_B);
+    shared->router(ROUTER_C)->flags = 0;
+    wccp_get_router_connection_stats(group, &one_way, &two_way);
+    EXPECT_EQ(one_way, 1u);
+    EXPECT_EQ(two_way, 1u);
+
+    wccp_sending_router *a = shared->router(ROUTER_A);
+    shared->report(ROUTER_A, {{US, 100}, {host(2), 100}});
+    a->view_appliances[0].buckets_assigned = 5;
+    EXPECT_EQ(wccp_get_router_assignment(group, a, US, &buckets), 0);
+    EXPECT_EQ(buckets, 5u);
+    EXPECT_EQ(wccp_get_router_assignment(group, a, host(3), &buckets), 1);
+    EXPECT_EQ(buckets, 0u);
+    EXPECT_EQ(wccp_get_router_assignment(group, a, US, nullptr), 1);
+
+    const wccp_sending_router *b = shared->router(ROUTER_B);
+    EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, b), 0);
+    a->view_appliances[1].buckets_assigned = 5;
+    EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, b), 1);
+    EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, a), 0);
+}
+
+} // namespace
