@@ -10,6 +10,8 @@ const char *const ROUTER_COMMANDS =
     "[@ROUTER] COMMAND...   for one router, or for all\n"
     "  show                       the whole state, as JSON\n"
     "  owners SERVICE             owner of each bucket or value, on one line\n"
+    "  members SERVICE            address, weight, share, seconds of silence, asked (0 or 1) of each "
+    "appliance, on lines\n"
     "  stop | resume              say and hear nothing | go on\n"
     "  ignore ADDRESS | heed ADDRESS     hear nothing of one appliance\n"
     "  forget ADDRESS             drop an appliance at once\n"
@@ -139,6 +141,23 @@ static std::string do_owners(const command_call &call) {
     return line;
 }
 
+static std::string do_members(const command_call &call) {
+    group *in = find_group(call);
+    std::string lines;
+    if (!in)
+        return lines;
+    const std::vector<address *> owners = owners_of(in);
+    for (const auto &[id, one] : in->members) {
+        if (!one.usable)
+            continue;
+        const auto share =
+            std::count_if(owners.begin(), owners.end(), [=](const address *owner) { return *owner == id; });
+        lines += text_of(id) + " " + std::to_string(one.weight) + " " + std::to_string(share) + " " +
+                 std::to_string(static_cast<int>(call.now - one.heard_at)) + (one.queried ? " 1\n" : " 0\n");
+    }
+    return lines;
+}
+
 static std::string do_assign(const command_call &call) {
     group *in = find_group(call);
     const auto first = number_of(call.words[2]), last = number_of(call.words[3]);
@@ -220,12 +239,12 @@ struct command_row {
     std::string (*act)(const command_call &call);
 };
 constexpr command_row COMMANDS[] = {
-    {"show", 1, 1, do_show},     {"owners", 2, 2, do_owners}, {"stop", 1, 1, do_stop},
-    {"resume", 1, 1, do_stop},   {"ignore", 2, 2, do_deaf},   {"heed", 2, 2, do_deaf},
-    {"forget", 2, 2, do_forget}, {"query", 2, 2, do_query},   {"assign", 5, 5, do_assign},
-    {"list", 2, 2, do_list},     {"unlist", 2, 2, do_list},   {"offer", 4, 4, do_offer},
-    {"nexus", 1, 1, do_form},    {"ios", 1, 1, do_form},      {"password", 1, 2, do_password},
-    {"fault", 2, 3, do_fault},   {"raw", 2, 3, do_raw},
+    {"show", 1, 1, do_show},         {"owners", 2, 2, do_owners}, {"members", 2, 2, do_members},
+    {"stop", 1, 1, do_stop},         {"resume", 1, 1, do_stop},   {"ignore", 2, 2, do_deaf},
+    {"heed", 2, 2, do_deaf},         {"forget", 2, 2, do_forget}, {"query", 2, 2, do_query},
+    {"assign", 5, 5, do_assign},     {"list", 2, 2, do_list},     {"unlist", 2, 2, do_list},
+    {"offer", 4, 4, do_offer},       {"nexus", 1, 1, do_form},    {"ios", 1, 1, do_form},
+    {"password", 1, 2, do_password}, {"fault", 2, 3, do_fault},   {"raw", 2, 3, do_raw},
 };
 
 std::string router_command(router *self, double now, const std::vector<std::string> &words, output *out) {
