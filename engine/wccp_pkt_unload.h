@@ -14,7 +14,7 @@ struct wccp_rtr_view_info {
     const be32 *routers;
     const uint8_t *appliances; // first web-cache element
 };
-struct wccp_assign_map_info {
+struct wccp_assign_map_info { // zeroed by the caller
     uint32_t present;
     uint32_t element_count;
     uint32_t value_count; // of the last mask element

@@ -1,0 +1,514 @@
+// The message loop in both directions: one received packet from its header to the views, and the three kinds
+// of packet that this appliance sends.
+//
+// Reception runs on the receive thread of the interface, whose stack holds the packet; transmission on the
+// timer thread or on whichever thread stops a group. Both hold the engine lock throughout, which is all that
+// the group's one transmit packet needs. A packet is written afresh for every Here-I-Am and Redirect-Assign;
+// a removal reply was finished when its query came and goes out unchanged each time.
+//
+// Anybody can send to the port. A packet is measured, then matched with a group and its security, then read,
+// and only a whole I-See-You with a router that may join gets as far as the group's records: up to the point
+// where the router is updated, nothing but counters has changed. What comes behind it is not rolled back when
+// a later step refuses.
+//
+// Two tables tell what messages consist of: the optional components of an I-See-You with their readers, and
+// the build steps of what is sent with their loaders. Each step that fails is logged by its words.
+//
+// An acknowledgement counts from the second Redirect-Assign on: a router that already carries the key after
+// the first has it from an I-See-You that crossed with it, not from the message.
+#include "engine/wccp_pkt_mgr.h"
+
+#include <cstring>
+
+#include "engine/wccp_network.h"
+#include "engine/wccp_pkt_load.h"
+#include "engine/wccp_pkt_unload.h"
+#include "engine/wccp_router_utils.h"
+#include "engine/wccp_utils.h"
+#include "engine/wccp_view_utils.h"
+#include "runtime/md5.h"
+
+static constexpr uint32_t OPTIONAL_COMPONENTS = 3; // in one I-See-You
+
+static int failed(const char *words, int status) {
+    QV_LOG(LC_LOG_ERR, "WCCP: %s failed.", words);
+    return status;
+}
+
+// An I-See-You.
+
+namespace {
+
+// What an I-See-You says, all of it, before any of it is acted upon.
+struct icu_message {
+    be32 router_id;
+    be32 receive_id;
+    wccp_rtr_view_info view;
+    wccp_rtr_capabilities offered;
+    wccp_assign_map_info map;
+};
+
+int read_map(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
+    return wccp_pkt_unload_assignment_map_component(group, pkt, &icu->map);
+}
+int read_command(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
+    wccp_command_info command;
+    const int status = wccp_pkt_unload_command_ext_component(group, pkt, &command);
+    if (status == 0)
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: router id %s sent command %d data 0x%x", group->id,
+               addr_text(icu->router_id).s, command.command, command.data);
+    return status;
+}
+int read_capabilities(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
+    return wccp_pkt_unload_capability_info_component(group, pkt, &icu->offered);
+}
+
+struct optional_component {
+    uint16_t type;
+    const char *words;
+    int (*read)(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu);
+};
+const optional_component optional_components[] = {
+    {WCCP_ASSIGNMENT_MAP, "unloading assignment map", read_map},
+    {WCCP_COMMAND_EXTENSION, "unloading command ext comp.", read_command},
+    {WCCP_CAPABILITY_INFO, "unloading capability comp.", read_capabilities},
+};
+
+// Also takes what is too short to be a component at all, and refuses it.
+int skip_unknown(wccp_service_group *group, wccp_pkt *pkt, const icu_message *icu) {
+    be16 type = {};
+    const uint32_t left = pkt->length - pkt->offset;
+    memcpy(&type, pkt->cursor, left < sizeof type ? left : sizeof type);
+    QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: ICU component type (%d) not recognized. sender router id %s",
+           group->id, to_host(type), addr_text(icu->router_id).s);
+    if (wccp_pkt_unload_unknown_component(group, pkt))
+        return failed("unloading unknown component", 1);
+    return 0;
+}
+
+int read_optional_component(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
+    if (pkt->length - pkt->offset >= sizeof(be16)) {
+        be16 type;
+        memcpy(&type, pkt->cursor, sizeof type);
+        for (const optional_component &row : optional_components)
+            if (row.type == to_host(type)) {
+                const int status = row.read(group, pkt, icu);
+                return status ? failed(row.words, status) : 0;
+            }
+    }
+    return skip_unknown(group, pkt, icu);
+}
+
+// The message as a whole: its components in their order, and no change of the group.
+int read_icu(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_info *service,
+             icu_message *icu) {
+    *icu = {};
+    icu->offered = {WCCP_METHOD_GRE, WCCP_ASSIGN_HASH, WCCP_METHOD_GRE};
+    const wccp_wire_router_identity *identity;
+    if (const int status = wccp_pkt_unload_router_identity_info_component(group, pkt, &identity))
+        return failed("unloading router identity", status);
+    icu->router_id = identity->router_id;
+    icu->receive_id = identity->receive_id;
+    const uint32_t flags = to_host(service->flags);
+    if (service->priority != group->priority || service->protocol != group->protocol ||
+        flags != group->service_flags) {
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d: service group config mismatch (router id: %s) .priority: rxed = %u local = %u, "
+               "protocol: rxed = %u local = %u, service flags: rxed = 0x%x local =  0x%x",
+               group->id, addr_text(icu->router_id).s, service->priority, group->priority, service->protocol,
+               group->protocol, flags, group->service_flags);
+        group->rx_service_mismatches++;
+    }
+    if (const int status = wccp_pkt_unload_router_view_component(group, pkt, &icu->view))
+        return failed("unloading router view", status);
+    for (uint32_t count = 0; pkt->offset < pkt->length;) {
+        if (const int status = read_optional_component(group, pkt, icu))
+            return status;
+        if (++count > OPTIONAL_COMPONENTS) {
+            QV_LOG(LC_LOG_ERR, "WCCP GRP %d: ICU bogus packet  (too many optional components).", group->id);
+            return 1;
+        }
+    }
+    return 0;
+}
+
+// The router's record, made from its first I-See-You. Null, with the status that ends the processing, when it
+// may not join.
+wccp_sending_router *find_or_create_router(wccp_service_group *group, const icu_message *icu,
+                                           int *out_status) {
+    *out_status = 0;
+    if (wccp_sending_router *router = wccp_find_sending_router(group, icu->router_id))
+        return router;
+    wccp_rtr_capabilities agreed;
+    uint32_t compatible;
+    *out_status =
+        wccp_process_router_capabilities(group, icu->router_id, &icu->offered, &agreed, &compatible);
+    return compatible ? wccp_create_sending_router(group, icu->router_id, &icu->offered, &agreed) : nullptr;
+}
+
+void take_acknowledgement(wccp_service_group *group, wccp_sending_router *router,
+                          const wccp_rtr_view_info *view) {
+    if (!(router->flags & WCCP_RTR_ASSIGN_UNACKED))
+        return;
+    const uint32_t key_change = to_host(view->key_change);
+    if (view->key_ipa == group->appliance_ipa && key_change == group->dsg_key_change &&
+        router->assign_tx_count > 1) {
+        router->flags &= ~WCCP_RTR_ASSIGN_UNACKED;
+        if (group->pending_acks != 0)
+            group->pending_acks--;
+        if (group->pending_acks == 0)
+            group->assign_timer.active = 0;
+        return;
+    }
+    QV_LOG(LC_LOG_INFO,
+           "WCCP GRP %d: router %s did NOT ack. REDIRECT ASSGN msg. expected key: %s, 0x%x rxed key: %s, "
+           "0x%x. pkts txed: %d, pending rtrs: %d",
+           group->id, addr_text(router->router_id).s, addr_text(group->appliance_ipa).s,
+           group->dsg_key_change, addr_text(view->key_ipa).s, key_change,
+           static_cast<int>(router->assign_tx_count), group->pending_acks);
+}
+
+// Takes the values of an Assignment Map into the router's view, and counts those of this appliance.
+wccp_assign_summary take_map(const wccp_service_group *group, wccp_sending_router *router,
+                             const wccp_assign_map_info *map) {
+    router->map_src_ip = to_host(map->masks->mask.src_ip);
+    router->map_dst_ip = to_host(map->masks->mask.dst_ip);
+    router->map_src_port = router->map_dst_port = 0;
+    for (uint32_t i = 0; i < router->view_appliance_count; i++)
+        memset(router->view_appliances[i].bucket_bits, 0, sizeof router->view_appliances[i].bucket_bits);
+
+    wccp_assign_summary summary = {
+        .valid = 1, .self_count = 0, .total_count = static_cast<uint16_t>(map->value_count)};
+    wccp_rtr_view_appliance *entry = nullptr;
+    for (uint32_t i = 0; i < map->value_count; i++) {
+        const be32 id = map->values[i].appliance_id;
+        if (id == group->appliance_ipa)
+            summary.self_count++;
+        if (i == 0 || !(id == map->values[i - 1].appliance_id))
+            entry = wccp_get_router_appliance_view_element(router, id);
+        if (!entry)
+            continue;
+        if (i < WCCP_MAX_BUCKETS) {
+            uint8_t *byte = reinterpret_cast<uint8_t *>(entry->bucket_bits) + i / 8;
+            *byte = static_cast<uint8_t>(*byte | 1u << (i % 8));
+        }
+        entry->buckets_assigned++;
+        entry->buckets_total = summary.total_count;
+    }
+    return summary;
+}
+
+} // namespace
+
+int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
+                               const wccp_wire_service_info *service) {
+    icu_message icu;
+    if (const int status = read_icu(group, pkt, service, &icu))
+        return status;
+    int status;
+    wccp_sending_router *router = find_or_create_router(group, &icu, &status);
+    if (!router)
+        return status;
+
+    router->receive_id = icu.receive_id;
+    router->last_icu_time = wccp_g.seconds;
+    router->src_ipa = pkt->ipa;
+    router->change_number = icu.view.change_number;
+    take_acknowledgement(group, router, &icu.view);
+    if ((status = wccp_update_router_view(group, router, icu.view.router_count, icu.view.routers)) != 0)
+        return status;
+    wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES] = {};
+    wccp_assign_summary hash = {}, mask = {};
+    status = wccp_process_router_view_web_cache_id_elements(group, icu.view.appliance_count,
+                                                            icu.view.appliances, decoded, &hash);
+    if (status == 0)
+        status = wccp_update_appliance_view(group, router, icu.view.appliance_count, decoded);
+    if (status != 0)
+        return status;
+    if (icu.map.present) {
+        if (!icu.map.masks || !icu.map.values)
+            return 1;
+        mask = take_map(group, router, &icu.map);
+    }
+    return wccp_update_appliance_redirect_status(group, router, &hash, &mask);
+}
+
+int wccp_pkt_process_removal_query(wccp_service_group *group, wccp_pkt *pkt) {
+    const wccp_wire_router_query *query;
+    if (wccp_pkt_unload_router_query_component(group, pkt, &query))
+        return failed("unloading router query", 1);
+    if (!(query->target == group->appliance_ipa)) {
+        QV_LOG(LC_LOG_INFO,
+               "WCCP GRP %d: removal query is not for us. sending router id: %s target appliance: %s",
+               group->id, addr_text(query->router_id).s, addr_text(query->target).s);
+        return 0;
+    }
+    return wccp_process_router_removal_query(group, query->router_id, query->receive_id);
+}
+
+// A packet.
+
+static int refuse(const wccp_pkt *pkt) {
+    wccp_g.rx_failures++;
+    QV_LOG(LC_LOG_WARNING, "WCCP processing received packet from %s failed", addr_text(pkt->ipa).s);
+    return 1;
+}
+
+// `digest` lies in the packet and is zero afterwards.
+static bool digest_is_right(const wccp_service_group *group, const wccp_pkt *pkt, uint8_t *digest) {
+    uint8_t received[MD5_DIGEST_BYTES], computed[MD5_DIGEST_BYTES];
+    memcpy(received, digest, sizeof received);
+    memset(digest, 0, sizeof received);
+    wccp_pkt_digest(group, pkt, computed);
+    return memcmp(received, computed, sizeof received) == 0;
+}
+
+// True when the packet has the security that the group asks for.
+static bool passes_security(wccp_service_group *group, const wccp_pkt *pkt,
+                            const wccp_wire_security_info *security, uint8_t *digest) {
+    const uint32_t option = to_host(security->option);
+    if (option != group->security_option) {
+        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: rxed mismatch security opt: %d configured opt: %d", group->id,
+               static_cast<int>(option), static_cast<int>(group->security_option));
+        group->rx_auth_mismatches++;
+        return false;
+    }
+    if (option == 1 && !digest_is_right(group, pkt, digest)) {
+        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: rxed authentication failed. Sender's source IP: %s", group->id,
+               addr_text(pkt->ipa).s);
+        group->rx_auth_failures++;
+        return false;
+    }
+    return true;
+}
+
+int wccp_process_received_packet(wccp_pkt *pkt) {
+    const wccp_wire_msg_header *header;
+    if (wccp_pkt_unload_msg_header(pkt, &header)) {
+        failed("unloading msg header", 1);
+        return refuse(pkt);
+    }
+    const uint32_t told = to_host(header->length) + static_cast<uint32_t>(sizeof *header);
+    if (told != pkt->length) {
+        QV_LOG(LC_LOG_ERR,
+               "WCCP: message header length (%d) and actual packet length (%d) do not match. sender ip: %s",
+               to_host(header->length), static_cast<int>(pkt->length), addr_text(pkt->ipa).s);
+        return 0;
+    }
+    if (to_host(header->version) != WCCP_VERSION) {
+        QV_LOG(LC_LOG_WARNING, "WCCP rxed verion (%d) is not supported. sender ip: %s",
+               to_host(header->version), addr_text(pkt->ipa).s);
+        return 0;
+    }
+    const uint32_t type = to_host(header->type);
+    if (type != WCCP_I_SEE_YOU && type != WCCP_REMOVAL_QUERY) {
+        QV_LOG(LC_LOG_INFO, "WCCP: message type (%u) is not for an appliance. sender ip: %s", type,
+               addr_text(pkt->ipa).s);
+        return 0;
+    }
+    const wccp_wire_security_info *security;
+    uint8_t *digest;
+    if (wccp_pkt_unload_security_info_component(pkt, &security, &digest)) {
+        failed("unloading security info", 1);
+        return refuse(pkt);
+    }
+    const wccp_wire_service_info *service;
+    if (wccp_pkt_unload_service_info_component(pkt, &service)) {
+        failed("unloading service info", 1);
+        return refuse(pkt);
+    }
+    wccp_service_group *group = wccp_find_group(service->service_id);
+    if (!group) {
+        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: rxed service group (%d) is not configured.", service->service_id,
+               service->service_id);
+        return refuse(pkt);
+    }
+    if (group->admin_state != WCCP_ADMIN_UP) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: is disabled. dropping the rxed packet.", group->id);
+        return 0;
+    }
+    if (!passes_security(group, pkt, security, digest)) {
+        group->rx_failures++;
+        return refuse(pkt);
+    }
+    if (type == WCCP_I_SEE_YOU) {
+        group->rx_icus++;
+        if (wccp_pkt_process_i_see_you(group, pkt, service))
+            group->rx_icu_failures++;
+    } else {
+        group->rx_removal_queries++;
+        if (wccp_pkt_process_removal_query(group, pkt))
+            group->rx_removal_failures++;
+    }
+    return 0;
+}
+
+// What is sent.
+
+namespace {
+
+struct message_build {
+    wccp_service_group *group;
+    wccp_pkt *pkt;
+    uint8_t *digest; // its place in the packet, once Security Info is there
+};
+using step_condition = bool (*)(const wccp_service_group *group);
+
+struct build_step {
+    const char *words;
+    int (*load)(message_build *build);
+    step_condition wanted; // null: always
+};
+
+// A load that takes group and packet, as a step.
+template <int (*Load)(wccp_service_group *, wccp_pkt *)>
+int step_of(message_build *build) {
+    return Load(build->group, build->pkt);
+}
+template <uint32_t Type>
+int header_step(message_build *build) {
+    return wccp_pkt_load_msg_header(build->pkt, Type);
+}
+int security_step(message_build *build) {
+    return wccp_pkt_load_security_info_component(build->group, build->pkt, &build->digest);
+}
+int finish_step(message_build *build) {
+    return wccp_pkt_finish(build->group, build->pkt, build->digest);
+}
+int refusing_step(message_build *) {
+    return 1;
+}
+
+template <uint32_t Method>
+bool assigns_by(const wccp_service_group *group) {
+    return group->assign_method == Method;
+}
+bool assigns_by_neither(const wccp_service_group *group) {
+    return group->assign_method != WCCP_ASSIGN_HASH && group->assign_method != WCCP_ASSIGN_MASK;
+}
+bool has_capabilities(const wccp_service_group *group) {
+    return group->fwd_method == WCCP_METHOD_L2 || group->assign_method == WCCP_ASSIGN_MASK ||
+           group->ret_method == WCCP_METHOD_L2;
+}
+bool is_shutting_down(const wccp_service_group *group) {
+    return (group->state_flags & WCCP_SHUTTING_DOWN) != 0;
+}
+
+const build_step here_i_am_steps[] = {
+    {"here-i-am: loading message header", header_step<WCCP_HERE_I_AM>, nullptr},
+    {"here-i-am: loading security info", security_step, nullptr},
+    {"here-i-am: loading service info", step_of<wccp_pkt_load_service_info_component>, nullptr},
+    {"here-i-am: loading web-cache info", step_of<wccp_pkt_load_web_cache_identity_info_component>, nullptr},
+    {"here-i-am: loading web-cache view info", step_of<wccp_pkt_load_web_cache_view_info_component>, nullptr},
+    {"here-i-am: loading capability info", step_of<wccp_pkt_load_capability_info_component>,
+     has_capabilities},
+    {"here-i-am: loading command extension", step_of<wccp_pkt_load_command_ext_component>, is_shutting_down},
+    {"here-i-am: packet finish", finish_step, nullptr},
+};
+const build_step redirect_assign_steps[] = {
+    {"redirect assign: loading message header", header_step<WCCP_REDIRECT_ASSIGN>, nullptr},
+    {"redirect assign: loading security info", security_step, nullptr},
+    {"redirect assign: loading service info", step_of<wccp_pkt_load_service_info_component>, nullptr},
+    {"redirect assign: loading assign. info", step_of<wccp_pkt_load_assignment_info_component>,
+     assigns_by<WCCP_ASSIGN_HASH>},
+    {"redirect assign: loading mask assign. info", step_of<wccp_pkt_load_mask_assignment_info_component>,
+     assigns_by<WCCP_ASSIGN_MASK>},
+    {"redirect assign: groups actual assignment method is not set.", refusing_step, assigns_by_neither},
+    {"redirect assign: packet finish", finish_step, nullptr},
+};
+
+template <size_t Count>
+int run_steps(const build_step (&steps)[Count], wccp_service_group *group, wccp_pkt *pkt) {
+    message_build build = {group, pkt, nullptr};
+    for (const build_step &step : steps) {
+        if (step.wanted && !step.wanted(group))
+            continue;
+        if (const int status = step.load(&build))
+            return failed(step.words, status);
+    }
+    return 0;
+}
+
+// A kind of packet for wccp_transmit_packet: its name in the log, the counter of its attempts, and how it is
+// written; null when it comes finished.
+struct packet_kind {
+    uint32_t number;
+    const char *name;
+    uint32_t wccp_service_group::*attempts;
+    int (*build)(wccp_service_group *group, wccp_pkt *pkt);
+};
+const packet_kind packet_kinds[] = {
+    {WCCP_HERE_I_AM, "HERE-I-AM", &wccp_service_group::tx_here_i_am, wccp_pkt_build_here_i_am},
+    {WCCP_REDIRECT_ASSIGN, "REDIRECT-ASSIGN", &wccp_service_group::tx_redirect_assign,
+     wccp_pkt_build_redirect_assign},
+    {WCCP_REMOVAL_REPLY, "HERE-I-AM (router query reply)", &wccp_service_group::tx_removal_replies, nullptr},
+};
+
+const packet_kind *find_kind(uint32_t number) {
+    for (const packet_kind &kind : packet_kinds)
+        if (kind.number == number)
+            return &kind;
+    return nullptr;
+}
+
+void clear_packet(wccp_pkt *pkt) {
+    memset(pkt, 0, sizeof *pkt);
+    pkt->cursor = pkt->data;
+}
+
+} // namespace
+
+int wccp_pkt_build_here_i_am(wccp_service_group *group, wccp_pkt *pkt) {
+    return run_steps(here_i_am_steps, group, pkt);
+}
+
+int wccp_pkt_build_redirect_assign(wccp_service_group *group, wccp_pkt *pkt) {
+    return run_steps(redirect_assign_steps, group, pkt);
+}
+
+int wccp_transmit_packet(wccp_service_group *group, wccp_pkt *pkt, uint32_t number) {
+    if (!pkt) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: packet is NULL. cannot send packet type %d", group->id,
+               static_cast<int>(number));
+        return 1;
+    }
+    const wccp_interface *interface = group->interfaces[0];
+    if (!interface || (interface->ready_flags & WCCP_ALL_READY) != WCCP_ALL_READY) {
+        group->tx_link_drops++;
+        return 0;
+    }
+    const packet_kind *kind = find_kind(number);
+    if (!kind) {
+        QV_LOG(LC_LOG_ERR, "WCCP transmit: unknown packet type (%d)", static_cast<int>(number));
+        group->tx_failures++;
+        return 1;
+    }
+    group->*kind->attempts += 1;
+    if (kind->build) {
+        clear_packet(pkt);
+        if (const int status = kind->build(group, pkt)) {
+            group->tx_build_failures++;
+            group->tx_failures++;
+            return status;
+        }
+    }
+    const int32_t sent = wccp_tx_pkt(group, pkt);
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: %s: sent %s to %s %d/%d (bytes)", group->id, interface->name,
+           kind->name, addr_text(pkt->ipa).s, sent, static_cast<int>(pkt->length));
+    if (sent != 0)
+        return 0;
+    group->tx_failures++;
+    return 1;
+}
+
+wccp_pkt *wccp_pkt_alloc() {
+    auto *pkt = static_cast<wccp_pkt *>(wccp_malloc(sizeof(wccp_pkt)));
+    if (pkt)
+        pkt->cursor = pkt->data;
+    return pkt;
+}
+
+int wccp_pkt_free(wccp_pkt *pkt) {
+    wccp_free(pkt);
+    return 0;
+}

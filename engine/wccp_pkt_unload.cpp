@@ -1,0 +1,356 @@
+// The reader's side of the wire format.
+//
+// A packet lies in the buffer of the receive thread that took it from the socket; the engine lock is held, by
+// that thread, from here to the end of its processing. Nothing is copied and nothing allocated: a result is a
+// small record, or a place in the packet that is good until the thread receives again. No group changes here,
+// but for one counter of capabilities that nobody knows.
+//
+// Whatever comes may have been written to hurt, so there is one way to the bytes: look<T>() gives a layout at
+// a distance behind the cursor if all of it was received, and null otherwise. A test on lengths that lie has
+// its message; look() comes behind it all the same, and no count from the wire is used before it has been
+// compared with what was received. Sizes are added up in 64 bits: 32 bits of a count, times 16, can't wrap.
+//
+// A component of odd length leaves all that follows on odd addresses. The wire layouts have alignment 1, and
+// so a place in the packet may be read through wherever it is.
+//
+// A component that is refused leaves the cursor where it was; its message is over then, and the caller tells
+// which step failed.
+#include "engine/wccp_pkt_unload.h"
+
+#include <climits>
+#include <iterator>
+
+#include "engine/wccp_utils.h"
+
+// The cursor.
+
+static uint32_t remaining(const wccp_pkt *pkt) {
+    const uint32_t received = pkt->length < WCCP_MAX_PACKET ? pkt->length : WCCP_MAX_PACKET;
+    return pkt->offset < received ? received - pkt->offset : 0;
+}
+
+// `count` Ts behind the cursor by `distance` bytes; null when not all of them were received.
+template <typename T>
+static const T *look(const wccp_pkt *pkt, uint64_t distance = 0, uint64_t count = 1) {
+    static_assert(alignof(T) == 1);
+    if (distance + count * sizeof(T) > remaining(pkt))
+        return nullptr;
+    return reinterpret_cast<const T *>(pkt->data + pkt->offset + distance);
+}
+
+// Moves on by `size` bytes, 0; or not at all, 1, when they were not received.
+static int pass(wccp_pkt *pkt, uint64_t size) {
+    if (size > remaining(pkt))
+        return 1;
+    pkt->offset += static_cast<uint32_t>(size);
+    pkt->cursor = pkt->data + pkt->offset;
+    return 0;
+}
+
+// As a %d of a log line shows it.
+static int shown(uint64_t size) {
+    return size < INT_MAX ? static_cast<int>(size) : INT_MAX;
+}
+
+// The way every message begins.
+
+int wccp_pkt_unload_msg_header(wccp_pkt *pkt, const wccp_wire_msg_header **out) {
+    *out = look<wccp_wire_msg_header>(pkt);
+    return *out ? pass(pkt, sizeof **out) : 1;
+}
+
+int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_security_info **out,
+                                            uint8_t **out_digest) {
+    *out = nullptr;
+    *out_digest = nullptr;
+    const auto *info = look<wccp_wire_security_info>(pkt);
+    if (!info)
+        return 1;
+    const bool digested = to_host(info->option) == 1;
+    const uint32_t size = digested ? sizeof(wccp_wire_security_md5) : sizeof(wccp_wire_security_info);
+    if (to_host(info->head.type) != WCCP_SECURITY_INFO) {
+        QV_LOG(LC_LOG_ERR, "WCCP: expected security componenet. rxed %d", to_host(info->head.type));
+        return 1;
+    }
+    if (to_host(info->head.length) > size - sizeof info->head)
+        return 1;
+    uint8_t *const digest = pkt->data + pkt->offset + offsetof(wccp_wire_security_md5, digest);
+    if (pass(pkt, size))
+        return 1;
+    *out = info;
+    *out_digest = digested ? digest : nullptr;
+    return 0;
+}
+
+int wccp_pkt_unload_service_info_component(wccp_pkt *pkt, const wccp_wire_service_info **out) {
+    *out = nullptr;
+    const auto *info = look<wccp_wire_service_info>(pkt);
+    if (!info)
+        return 1;
+    if (to_host(info->head.type) != WCCP_SERVICE_INFO) {
+        QV_LOG(LC_LOG_ERR, "WCCP: expected service info componenet. rxed %d", to_host(info->head.type));
+        return 1;
+    }
+    if (to_host(info->head.length) != sizeof *info - sizeof info->head)
+        return 1;
+    *out = info;
+    return pass(pkt, sizeof *info);
+}
+
+// The components of an I-See-You that each one has.
+
+int wccp_pkt_unload_router_identity_info_component(wccp_service_group *group, wccp_pkt *pkt,
+                                                   const wccp_wire_router_identity **out) {
+    *out = nullptr;
+    const auto *identity = look<wccp_wire_router_identity>(pkt);
+    if (!identity) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: static length (%d) is longer than remaining pkt len (%d)", group->id,
+               shown(sizeof *identity), shown(remaining(pkt)));
+        return 1;
+    }
+    if (to_host(identity->head.type) != WCCP_ROUTER_IDENTITY_INFO) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: expecting router id info, rxed %d", group->id,
+               to_host(identity->head.type));
+        return 1;
+    }
+    const uint64_t size = sizeof *identity + uint64_t{to_host(identity->received_from)} * sizeof(be32);
+    if (size > remaining(pkt)) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: full length does not fit in pkt", group->id);
+        return 1;
+    }
+    if (to_host(identity->head.length) != size - sizeof identity->head) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: rxed length (%d) and expected length (%d) mismatch", group->id,
+               to_host(identity->head.length), shown(size - sizeof identity->head));
+        return 1;
+    }
+    *out = identity;
+    return pass(pkt, size);
+}
+
+wccp_element_shape wccp_view_element_shape(uint16_t flags, uint32_t compat_mode) {
+    static constexpr wccp_element_shape hash = {WCCP_ELEMENT_HASH, sizeof(wccp_wire_view_element_hash),
+                                                offsetof(wccp_wire_view_element_hash, weight)};
+    static constexpr wccp_element_shape no_redirect = {WCCP_ELEMENT_NO_REDIRECT,
+                                                       sizeof(wccp_wire_view_element_mask),
+                                                       offsetof(wccp_wire_view_element_mask, weight)};
+    static constexpr wccp_element_shape nexus = {WCCP_ELEMENT_REDIRECT, sizeof(wccp_wire_view_element_mask),
+                                                 offsetof(wccp_wire_view_element_mask, weight)};
+    static constexpr wccp_element_shape ios = {WCCP_ELEMENT_REDIRECT,
+                                               sizeof(wccp_wire_view_element_mask_short),
+                                               offsetof(wccp_wire_view_element_mask_short, weight)};
+    if (!(flags & WCCP_IDENTITY_MASK))
+        return hash;
+    if (flags & WCCP_IDENTITY_NO_REDIRECT)
+        return no_redirect;
+    return compat_mode == WCCP_COMPAT_NEXUS ? nexus : ios;
+}
+
+// The size of a router view whose `count` elements begin at `distance`. False when an element begins behind
+// the received bytes or the last one ends there.
+static bool measure_view(const wccp_service_group *group, const wccp_pkt *pkt, uint64_t distance,
+                         uint32_t count, uint64_t *out_size) {
+    for (uint32_t i = 0; i < count; i++) {
+        const auto *element = look<wccp_wire_view_element>(pkt, distance);
+        if (!element)
+            return false;
+        distance += wccp_view_element_shape(to_host(element->flags), group->compat_mode).size;
+    }
+    *out_size = distance;
+    return distance <= remaining(pkt);
+}
+
+int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *pkt, wccp_rtr_view_info *out) {
+    *out = {};
+    const auto *view = look<wccp_wire_router_view>(pkt);
+    if (!view) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: static component does not fit in pkt", group->id);
+        return 1;
+    }
+    if (to_host(view->head.type) != WCCP_ROUTER_VIEW_INFO) {
+        QV_LOG(LC_LOG_ERR, "WCCP: bad router view type rxed (%d)", to_host(view->head.type));
+        return 1;
+    }
+    const uint32_t routers = to_host(view->routers);
+    if (routers > WCCP_MAX_ROUTERS) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bad number of routers (%d) in ICU pkt. ", group->id,
+               static_cast<int>(routers));
+        return 1;
+    }
+    const auto *addresses = look<be32>(pkt, sizeof *view, routers);
+    if (!addresses) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: number of routers does not fit in pkt", group->id);
+        return 1;
+    }
+    const uint32_t elements_at = static_cast<uint32_t>(sizeof *view + (routers + 1) * sizeof(be32));
+    // A count that was cut off stands for no appliances; the view then doesn't fit for want of the count.
+    const auto *count = look<be32>(pkt, elements_at - sizeof(be32));
+    const uint32_t appliances = count ? to_host(*count) : 0;
+    if (appliances > WCCP_MAX_APPLIANCES) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bad number of appliances (%d) in ICU pkt.", group->id,
+               static_cast<int>(appliances));
+        return 1;
+    }
+    uint64_t size;
+    if (!measure_view(group, pkt, elements_at, appliances, &size)) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: # of appliances (%u x %d bytes) does not fit in pkt length (%u)",
+               group->id, appliances, shown(sizeof(wccp_wire_view_element_hash)), pkt->offset);
+        return 1;
+    }
+    if (to_host(view->head.length) != size - sizeof view->head) {
+        QV_LOG(LC_LOG_ERR,
+               "WCCP GRP %d: bad length. rxed length %d pkt length %d (check compatibility mode (IOS/Nexus))",
+               group->id, to_host(view->head.length), shown(size - sizeof view->head));
+        return 1;
+    }
+    *out = {
+        .change_number = view->change_number,
+        .key_ipa = view->key_address,
+        .key_change = view->key_change,
+        .router_count = routers,
+        .appliance_count = appliances,
+        .routers = addresses,
+        .appliances = pkt->data + pkt->offset + elements_at,
+    };
+    return pass(pkt, size);
+}
+
+// The optional components of an I-See-You.
+
+int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt *pkt,
+                                             wccp_assign_map_info *out) {
+    constexpr uint32_t smallest =
+        sizeof(wccp_wire_assignment_map) + sizeof(wccp_wire_mask_element) + sizeof(wccp_wire_value_element);
+    constexpr uint32_t head = sizeof(wccp_wire_component);
+    const auto *map = look<wccp_wire_assignment_map>(pkt);
+    if (!map || remaining(pkt) < smallest) {
+        QV_LOG(LC_LOG_ERR,
+               "WCCP GRP %d: minimum assignment map (len = %d) does not fit in the packet. router src ip : "
+               "%s ",
+               group->id, shown(smallest), addr_text(pkt->ipa).s);
+        return 1;
+    }
+    const uint32_t declared = to_host(map->head.length);
+    if (declared < smallest - head) {
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d:  assignment map length: %d does not include at least one mask/value set "
+               "(expected minimum len: %d)  router src ip : %s ",
+               group->id, shown(declared), shown(smallest - head), addr_text(pkt->ipa).s);
+        return 1;
+    }
+    out->element_count = to_host(map->mask_elements);
+    out->masks = look<wccp_wire_mask_element>(pkt, sizeof *map);
+    uint64_t size = sizeof *map; // with the component's head
+    for (uint32_t i = 0; i < out->element_count; i++) {
+        const auto *element = look<wccp_wire_mask_element>(pkt, size);
+        const uint64_t values_at = size + sizeof *element;
+        const uint64_t values = element ? to_host(element->values) : 0;
+        size = values_at + values * sizeof(wccp_wire_value_element);
+        if (!element || size - head > declared || size > remaining(pkt)) {
+            QV_LOG(LC_LOG_ERR,
+                   "WCCP GRP %d: unload assignment map: packet length is BAD or it has bogus values. rxed "
+                   "len: %d current len %d.",
+                   group->id, shown(declared), shown(size - head));
+            return 1;
+        }
+        out->value_count = static_cast<uint32_t>(values);
+        out->values = look<wccp_wire_value_element>(pkt, values_at, values);
+    }
+    out->present = 1;
+    return pass(pkt, size);
+}
+
+int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pkt *pkt,
+                                              wccp_rtr_capabilities *out) {
+    struct capability {
+        uint16_t type;
+        uint32_t wccp_rtr_capabilities::*word;
+    };
+    static constexpr capability known[] = {
+        {WCCP_CAP_FORWARDING, &wccp_rtr_capabilities::forwarding},
+        {WCCP_CAP_ASSIGNMENT, &wccp_rtr_capabilities::assignment},
+        {WCCP_CAP_RETURN, &wccp_rtr_capabilities::ret},
+    };
+    constexpr uint32_t element_size = sizeof(wccp_wire_capability_element);
+    const auto *head = look<wccp_wire_component>(pkt);
+    if (!head)
+        return 1;
+    const uint32_t length = to_host(head->length);
+    if (length % element_size != 0) {
+        QV_LOG(LC_LOG_ERR,
+               "WCCP GRP %d: capability component length is not aligned. length %d individual element size "
+               "%d",
+               group->id, shown(length), shown(element_size));
+        return 1;
+    }
+    if (length >= (std::size(known) + 1) * element_size)
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: more capabilities than are known. length %d", group->id,
+               shown(length));
+    const auto *element = look<wccp_wire_capability_element>(pkt, sizeof *head, length / element_size);
+    if (!element)
+        return 1;
+    for (uint32_t i = 0; i < length / element_size; i++, element++) {
+        const capability *found = nullptr;
+        for (const capability &each : known)
+            if (each.type == to_host(element->type))
+                found = &each;
+        if (found)
+            out->*found->word = to_host(element->value);
+        else
+            group->rx_unknown_capabilities++;
+    }
+    return pass(pkt, sizeof *head + length);
+}
+
+int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *pkt, wccp_command_info *out) {
+    *out = {};
+    const auto *extension = look<wccp_wire_command_ext>(pkt);
+    if (!extension) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: no commands in pkt", group->id);
+        return 1;
+    }
+    const uint32_t length = to_host(extension->head.length);
+    if (pass(pkt, sizeof extension->head + length)) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bogus component length (%d): does not  fit in the packet.",
+               group->id, shown(length));
+        return 1;
+    }
+    out->command = to_host(extension->command);
+    out->data = to_host(extension->data);
+    return 0;
+}
+
+int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt) {
+    const auto *head = look<wccp_wire_component>(pkt);
+    const int type = head ? to_host(head->type) : 0, length = head ? to_host(head->length) : 0;
+    if (head && pass(pkt, sizeof *head + to_host(head->length)) == 0)
+        return 0;
+    QV_LOG(LC_LOG_ERR,
+           "WCCP GRP %d: unkown pkt length does not fit in the packet. component type: %d length %d ",
+           group->id, type, length);
+    return 1;
+}
+
+// The one component of a Removal Query.
+
+int wccp_pkt_unload_router_query_component(wccp_service_group *group, wccp_pkt *pkt,
+                                           const wccp_wire_router_query **out) {
+    constexpr uint32_t length = sizeof(wccp_wire_router_query) - sizeof(wccp_wire_component);
+    *out = nullptr;
+    const auto *query = look<wccp_wire_router_query>(pkt);
+    if (!query) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: router query comp. does not fit in packet.", group->id);
+        return 1;
+    }
+    if (to_host(query->head.type) != WCCP_ROUTER_QUERY_INFO) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bad router query type rxed (%d)", group->id,
+               to_host(query->head.type));
+        return 1;
+    }
+    if (to_host(query->head.length) != length) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bad length. rxed length %d pkt length %d", group->id,
+               to_host(query->head.length), shown(length));
+        return 1;
+    }
+    *out = query;
+    return pass(pkt, sizeof *query);
+}
