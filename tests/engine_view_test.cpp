@@ -138,6 +138,8 @@ TEST_F(ViewTest, AnAddressNamedTwiceKeepsUnionAndArraysInStep) {
         report(ROUTER_A, twice);
         EXPECT_EQ(changes(), 0u);
     }
+    report(ROUTER_A, {{host(2), 100}, {US, 100}, {host(2), 100}, {US, 50}});
+    EXPECT_EQ(changes(), 0u);
     EXPECT_EQ(mentions(group->appliance_view), (counts{{"10.0.0.1", 2}, {"10.0.0.2", 3}}));
     report(ROUTER_A, {{host(2), 100}, {US, 100}});
     EXPECT_EQ(mentions(group->appliance_view), (counts{{"10.0.0.1", 1}, {"10.0.0.2", 2}}));
@@ -409,6 +411,7 @@ TEST_F(RedirectTest, EverythingElsewhereFromTheStartIsBackup) {
         {ROUTER_B, 0, 0, 0, WCCP_STATE_BACKUP},
         {ROUTER_C, 0, 0, 0, WCCP_STATE_INIT},
     });
+    EXPECT_EQ(group->transitions, 1u);
 }
 
 TEST_F(RedirectTest, NothingTakenFromAnEmptyCount) {
