@@ -1,0 +1,287 @@
+// The manager: start and stop of the engine in either mode, the tick by hand, allocator and text helpers; and
+// the thread contexts under it.
+
+#include "engine/wccp_mgr.h"
+
+#include <dlfcn.h>
+#include <gtest/gtest.h>
+#include <pthread.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstring>
+#include <fstream>
+#include <new>
+#include <string>
+
+#include "engine/cthread.h"
+#include "engine/wccp_config.h"
+#include "engine/wccp_host.h"
+#include "engine/wccp_link_mgr.h"
+#include "engine/wccpd_common.h"
+#include "platform/qvcommon.h"
+#include "runtime/common.h"
+#include "tests/support/engine_fixture.h"
+#include "tests/support/fake_tunneld.h"
+
+// The closed library's, in its place: refuses when told to, and never starts its thread here.
+static bool registration_fails;
+int qv_register_netlink_notifier(uint32_t, qv_netlink_callback) {
+    return registration_fails ? 5 : 0;
+}
+int qv_start_netlink_monitor(uint32_t) {
+    return 0;
+}
+
+namespace {
+
+int threads_named(const std::string &wanted) {
+    int count = 0;
+    for (int i = 0; i < 100; i++) { // a thread gives itself its name
+        count = 0;
+        const std::string command = "cat /proc/" + std::to_string(getpid()) + "/task/*/comm";
+        FILE *names = popen(command.c_str(), "r");
+        char line[64];
+        while (fgets(line, sizeof line, names))
+            count += std::string(line) == wanted + "\n";
+        pclose(names);
+        if (count)
+            break;
+        usleep(1000);
+    }
+    return count;
+}
+
+class Manager : public testing::Test {
+protected:
+    void SetUp() override {
+        wccpd_exiting = 0;
+        registration_fails = false;
+        test_host_bridge_mode = 0;
+        strlcpy(wccp_primary_wan_interface_name, "lo", sizeof wccp_primary_wan_interface_name);
+        write_mem_conf();
+    }
+    void TearDown() override {
+        wccpd_exiting = 0;
+        wccp_exit_mgr();
+        EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
+    }
+    static wccp_service_group *add_group(uint8_t id, uint32_t admin) {
+        wccp_grp_config config = {};
+        config.group_id = id;
+        config.admin = admin;
+        config.compatibility = WCCP_COMPAT_IOS;
+        strlcpy(config.interface, "lo", sizeof config.interface);
+        EXPECT_EQ(wccp_add_group(&config), 0);
+        return wccp_find_group(id);
+    }
+};
+
+TEST_F(Manager, StartsThreadsMailboxAndPrimaryInterface) {
+    memset(static_cast<void *>(&wccp_g.seconds), 0xff, sizeof wccp_g.seconds);
+    ASSERT_EQ(wccp_init_mgr(), 0);
+    EXPECT_LT(wccp_g.seconds, 10u);
+    EXPECT_EQ(wccp_g.mcast_ttl, 5);
+    EXPECT_EQ(wccp_g.track_primary, 0u);
+    ASSERT_NE(wccp_g.primary_if, nullptr);
+    EXPECT_STREQ(wccp_g.primary_if->name, "lo");
+    EXPECT_EQ(wccp_g.interfaces[126].ucast_fd, -1);
+    EXPECT_NE(wccp_mailbox, nullptr);
+    EXPECT_GE(g_qvif_skfd, 0);
+    EXPECT_EQ(threads_named("WCCP_TIMER"), 1);
+    EXPECT_EQ(threads_named("WCCP_RX_lo"), 1);
+    wccp_service_group *zero = add_group(0, WCCP_ADMIN_DOWN);
+    EXPECT_EQ(wccp_find_group(256), zero);
+    EXPECT_EQ(wccp_find_group(1), nullptr);
+}
+
+TEST_F(Manager, ALinkManagerThatFailsIsNoFailure) {
+    registration_fails = true;
+    EXPECT_EQ(wccp_init_link_mgr(), 5);
+    wccp_deinit_link_mgr();
+    EXPECT_EQ(wccp_init_mgr(), 0);
+}
+
+TEST_F(Manager, InBridgeModeTheClockStandsStill) {
+    test_host_bridge_mode = 1;
+    ASSERT_EQ(wccp_init_mgr(), 0);
+    EXPECT_EQ(threads_named("WCCP_RX_lo"), 1) << "an interface with an address has its receive thread";
+    usleep(1300000);
+    EXPECT_EQ(wccp_g.seconds, 0u);
+    EXPECT_EQ(threads_named("WCCP_TIMER"), 0);
+}
+
+TEST_F(Manager, TheTickRunsEnabledGroupsUntilShutdown) {
+    test_host_bridge_mode = 1; // time is turned by hand
+    ASSERT_EQ(wccp_init_mgr(), 0);
+    wccp_service_group *up = add_group(1, WCCP_ADMIN_UP), *down = add_group(2, WCCP_ADMIN_DOWN);
+    down->monitor_timer = up->monitor_timer;
+    wccp_tick();
+    wccp_tick();
+    EXPECT_EQ(wccp_g.seconds, 2u);
+    EXPECT_EQ(up->monitor_timer.countdown, 3u);
+    EXPECT_EQ(down->monitor_timer.countdown, 5u);
+    wccpd_exiting = 1;
+    wccp_tick();
+    EXPECT_EQ(wccp_g.seconds, 2u);
+    EXPECT_EQ(up->monitor_timer.countdown, 3u);
+}
+
+TEST_F(Manager, OnlyBridgeModeStopsTheEngine) {
+    ASSERT_EQ(wccp_init_mgr(), 0);
+    const wccp_service_group *group = add_group(1, WCCP_ADMIN_UP);
+    for (const char *mode : {"router", "server"})
+        EXPECT_EQ(wccp_system_mode_change_event(mode), 0);
+    for (const char *mode : {"", "Bridge", "bridged", "bridg"})
+        EXPECT_EQ(wccp_system_mode_change_event(mode), 1);
+    EXPECT_EQ(wccp_system_mode_change_event(nullptr), 1);
+    EXPECT_EQ(group->hia_timer.active, 1);
+    EXPECT_EQ(threads_named("WCCP_TIMER"), 1);
+    EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0);
+    EXPECT_EQ(group->hia_timer.active, 0);
+    EXPECT_EQ(group->admin_state, WCCP_ADMIN_UP);
+    EXPECT_EQ(threads_named("WCCP_TIMER") + threads_named("WCCP_RX_lo"), 0);
+    EXPECT_EQ(wccp_system_mode_change_event("router"), 0);
+    EXPECT_EQ(threads_named("WCCP_TIMER"), 0) << "nothing starts them again";
+}
+
+TEST_F(Manager, AllocationsAreZeroedAndCounted) {
+    ASSERT_EQ(wccp_init_mgr(), 0);
+    const uint32_t allocs = wccp_g.stat_allocs, frees = wccp_g.stat_frees;
+    auto *dirty = static_cast<uint8_t *>(wccp_malloc(4096));
+    memset(dirty, 0xff, 4096);
+    wccp_free(dirty);
+    auto *clean = static_cast<uint8_t *>(wccp_malloc(4096));
+    for (uint32_t i = 0; i < 4096; i++)
+        ASSERT_EQ(clean[i], 0);
+    wccp_free(clean);
+    wccp_free(nullptr);
+    EXPECT_EQ(wccp_g.stat_allocs, allocs + 2);
+    EXPECT_EQ(wccp_g.stat_frees, frees + 2);
+#ifndef WCCP_SANITIZED // whose allocator ends the program
+    EXPECT_EQ(wccp_calloc(0xffffffff, 0xffffffff), nullptr);
+    EXPECT_EQ(wccp_g.stat_alloc_fails, 1u);
+    EXPECT_EQ(wccp_g.stat_allocs, allocs + 2);
+#endif
+}
+
+TEST(Text, SecondsBecomeDaysHoursMinutesSeconds) {
+    char text[128];
+    wccp_seconds_to_str(90061, text, sizeof text);
+    EXPECT_STREQ(text, "1:1:1:1");
+    wccp_seconds_to_str(0xffffffff, text, sizeof text);
+    EXPECT_STREQ(text, "49710:6:28:15");
+    for (const uint32_t short_one : {31u, 0u, 256u, 256u + 31}) {
+        strlcpy(text, "as it was", sizeof text);
+        wccp_seconds_to_str(1, text, short_one);
+        EXPECT_STREQ(text, "as it was");
+    }
+    wccp_seconds_to_str(59, text, 256 + 32);
+    EXPECT_STREQ(text, "0:0:0:59");
+    wccp_seconds_to_str(1, nullptr, 128);
+}
+
+struct birth {
+    std::atomic<int> runs = 0;
+    size_t stack = 0;
+    sigset_t blocked;
+    cpu_set_t cpus;
+    int nice = 0;
+    std::atomic<void *> ended = nullptr;
+};
+
+void *look_around(void *argument) {
+    auto *seen = static_cast<birth *>(argument);
+    pthread_attr_t attributes;
+    pthread_getattr_np(pthread_self(), &attributes);
+    pthread_attr_getstacksize(&attributes, &seen->stack);
+    pthread_attr_destroy(&attributes);
+    pthread_sigmask(SIG_BLOCK, nullptr, &seen->blocked);
+    CPU_ZERO(&seen->cpus);
+    sched_getaffinity(0, sizeof seen->cpus, &seen->cpus);
+    seen->nice = getpriority(PRIO_PROCESS, 0);
+    seen->runs++;
+    return nullptr;
+}
+
+void *note_end(void *argument) {
+    static_cast<birth *>(argument)->ended = argument;
+    return nullptr;
+}
+
+TEST(Thread, IsBornBoundSmallAndDeafToSignals) {
+    birth seen;
+    cthread *context = cthread_init(std::string(100, 'n').c_str(), look_around, &seen, note_end, &seen,
+                                    SCHED_OTHER, 3, 0, 7);
+    ASSERT_NE(context, nullptr);
+    EXPECT_EQ(strlen(context->name), 63u);
+    EXPECT_EQ(context->max_wait, 7u);
+    ASSERT_EQ(cthread_start(context), 0);
+    EXPECT_EQ(context->listed, 1);
+    EXPECT_NE(context->heartbeat, 0u);
+    cthread_join(context);
+    EXPECT_EQ(seen.runs, 1);
+    EXPECT_EQ(seen.ended, &seen) << "the end function ran behind the body";
+    EXPECT_EQ(seen.nice, 3);
+    EXPECT_LE(seen.stack, 520u * 1024);
+    for (const int number : {SIGHUP, SIGINT, SIGTERM, SIGPIPE, SIGUSR1, SIGUSR2})
+        EXPECT_EQ(sigismember(&seen.blocked, number), 1) << number;
+    EXPECT_EQ(CPU_COUNT(&seen.cpus), 1);
+    EXPECT_TRUE(CPU_ISSET(0, &seen.cpus));
+    sigset_t own;
+    pthread_sigmask(SIG_BLOCK, nullptr, &own);
+    EXPECT_EQ(sigismember(&own, SIGTERM), 0) << "the caller's mask is as it was";
+}
+
+TEST(Thread, IsNotStoppedByAPlaceThatItCannotHave) {
+    birth seen;
+    cthread *context = cthread_init("astray", look_around, &seen, nullptr, nullptr, SCHED_OTHER, 0, 128, 0);
+    ASSERT_EQ(cthread_start(context), 0);
+    cthread_join(context);
+    EXPECT_EQ(seen.runs, 1);
+}
+
+TEST(Thread, WithoutABodyOrAStartEnds) {
+    cthread *empty = cthread_init("empty", nullptr, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);
+    ASSERT_EQ(cthread_start(empty), 0);
+    cthread_join(empty);
+    cthread *idle = cthread_init("idle", nullptr, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);
+    cthread_cancel(idle);
+    cthread_join(idle);
+    cthread *refused = cthread_init("refused", nullptr, nullptr, nullptr, nullptr, 77, 0, 0, 0);
+    EXPECT_EQ(cthread_start(refused), 1);
+    EXPECT_EQ(refused->listed, 0);
+    cthread_join(refused);
+    EXPECT_EQ(cthread_start(nullptr), 1);
+    cthread_join(nullptr);
+}
+
+void *sleep_for_ever(void *) {
+    for (;;)
+        pause();
+}
+
+TEST(Thread, AllOfThemAreCancelledBeforeOneIsWaitedFor) {
+    for (int i = 0; i < 20; i++)
+        ASSERT_EQ(cthread_start(cthread_init("sleeper", sleep_for_ever, nullptr, nullptr, nullptr,
+                                             SCHED_OTHER, 0, 0, 0)),
+                  0);
+    cthread *one = cthread_init("single", sleep_for_ever, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);
+    ASSERT_EQ(cthread_start(one), 0);
+    cthread_cancel(one);
+    EXPECT_EQ(one->listed, 0);
+    cthread_join(one);
+    cthread *chain = cthread_cancel_listed();
+    int count = 0;
+    for (const cthread *context = chain; context; context = context->next)
+        count++;
+    EXPECT_EQ(count, 20);
+    EXPECT_EQ(cthread_cancel_listed(), nullptr);
+    cthread_join_chain(chain);
+    cthread_cancel_all();
+}
+
+} // namespace

@@ -1,0 +1,506 @@
+// The engine's threads against each other: its stop while they wait, for the lock or for tunneld; addresses
+// that change under the receivers; signals. A watchdog ends the program where one of them never comes back.
+
+#include <arpa/inet.h>
+#include <dirent.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <net/if.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/ioctl.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <cstring>
+#include <fstream>
+#include <new>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "engine/cthread.h"
+#include "engine/wccp_config.h"
+#include "engine/wccp_host.h"
+#include "engine/wccp_link_mgr.h"
+#include "engine/wccp_network.h"
+#include "engine/wccp_tunnel.h"
+#include "engine/wccp_utils.h"
+#include "engine/wccp_wire.h"
+#include "engine/wccpd_common.h"
+#include "runtime/common.h"
+#include "tests/support/fake_tunneld.h"
+#include "tests/support/peer_network.h"
+#include "tests/support/wire_bytes.h"
+
+using namespace std::chrono_literals;
+using steady = std::chrono::steady_clock;
+
+namespace {
+
+be32 ipa(const std::string &text) {
+    return from_raw_word(address_word(text));
+}
+
+struct watchdog {
+    explicit watchdog(std::chrono::seconds limit)
+        : thread([this, limit] {
+              const auto end = steady::now() + limit;
+              while (!done && steady::now() < end)
+                  std::this_thread::sleep_for(10ms);
+              if (!done) {
+                  fprintf(stderr, "a thread never came back\n");
+                  _exit(99);
+              }
+          }) {}
+    ~watchdog() {
+        done = true;
+        thread.join();
+    }
+    std::atomic<bool> done = false;
+    std::thread thread;
+};
+
+struct task {
+    std::string name;
+    uint64_t blocked = 0;
+};
+std::vector<task> engine_tasks() {
+    std::vector<task> out;
+    DIR *directory = opendir("/proc/self/task");
+    while (const dirent *entry = readdir(directory)) {
+        std::ifstream file(std::string("/proc/self/task/") + entry->d_name + "/status");
+        task one;
+        std::string line;
+        while (std::getline(file, line)) {
+            if (line.rfind("Name:", 0) == 0)
+                one.name = line.substr(6);
+            if (line.rfind("SigBlk:", 0) == 0)
+                one.blocked = std::stoull(line.substr(8), nullptr, 16);
+        }
+        if (one.name.rfind("WCCP_", 0) == 0)
+            out.push_back(one);
+    }
+    closedir(directory);
+    return out;
+}
+
+template <typename Condition>
+bool soon(Condition condition, std::chrono::milliseconds limit = 5s) {
+    const auto end = steady::now() + limit;
+    while (!condition()) {
+        if (steady::now() > end)
+            return false;
+        std::this_thread::sleep_for(2ms);
+    }
+    return true;
+}
+
+bool lock_is_free() {
+    if (pthread_mutex_trylock(&wccp_g.lock) != 0)
+        return false;
+    pthread_mutex_unlock(&wccp_g.lock);
+    return true;
+}
+
+enum method { GRE = 1, L2 = 2 }; // a router of the first kind needs a tunnel
+
+// I-See-You of a router that sees this appliance: no security, hash, no assignment yet.
+std::vector<uint8_t> i_see_you(uint8_t id, const std::string &router, const std::string &appliance,
+                               method way = GRE) {
+    const uint32_t router_word = ntohl(address_word(router)), appliance_word = ntohl(address_word(appliance));
+    wire_bytes security, service, identity, view, capabilities;
+    security.u16(0).u16(4).u32(0);
+    service.u16(1).u16(24).u8(1).u8(id).zeros(22);
+    identity.u16(2).u16(20).u32(router_word).u32(1).u32(appliance_word).u32(1).u32(appliance_word);
+    view.u16(4).u16(20 + 4 + 44).u32(1).u32(0).u32(0).u32(1).u32(router_word).u32(1);
+    view.u32(appliance_word).zeros(40);
+    capabilities.u16(8).u16(24).u16(1).u16(4).u32(way).u16(2).u16(4).u32(1).u16(3).u16(4).u32(way);
+    return wire_message(11, {security, service, identity, view, capabilities});
+}
+
+class Threads : public testing::Test {
+protected:
+    void SetUp() override {
+        wccpd_exiting = 0;
+        new (&wccp_g) wccp_global{};
+        wccp_g.mcast_ttl = 5;
+        wccp_init_network();
+        write_mem_conf();
+        ASSERT_EQ(wccp_init_shmem(), 0);
+        strlcpy(wccp_primary_wan_interface_name, "wan0", sizeof wccp_primary_wan_interface_name);
+        peer.link("wan0", "10.1.0.1/24", "rt0", "10.1.0.2/24");
+        peer.link("wan1", "10.2.0.1/24", "rt1", "10.2.0.2/24");
+        ASSERT_TRUE(soon([] { return wccp_get_if_status("wan0") && wccp_get_if_status("wan1"); }));
+    }
+    void TearDown() override {
+        cthread_cancel_all();
+        wccp_del_all_groups();
+        wccp_deinit_link_mgr();
+        wccp_del_all_tunnels();
+        run_command("ip link del wan0");
+        run_command("ip link del wan1");
+        EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
+    }
+
+    static wccp_service_group *add_group(uint8_t id, const char *interface) {
+        wccp_grp_config config = {};
+        config.group_id = id;
+        config.admin = WCCP_ADMIN_UP;
+        config.fwd_method = WCCP_METHOD_EITHER;
+        config.assign_method = WCCP_ASSIGN_EITHER;
+        config.compatibility = WCCP_COMPAT_IOS;
+        config.interface_set = 1;
+        strlcpy(config.interface, interface, sizeof config.interface);
+        EXPECT_EQ(wccp_add_group(&config), 0);
+        return wccp_find_group(id);
+    }
+    static uint32_t router_count(uint8_t id) {
+        const wccp_engine_lock lock;
+        const wccp_service_group *group = wccp_find_group(id);
+        return group ? group->sending_router_count : 0;
+    }
+    static void start_timer_thread() {
+        ASSERT_EQ(cthread_start(cthread_init("WCCP_TIMER", wccp_timer_thread_fn, nullptr, nullptr, nullptr, 0,
+                                             0, 0, 0)),
+                  0);
+    }
+
+    peer_network peer;
+};
+
+// The stop holds the engine lock while it waits for tunneld; the packets that come in meanwhile are in the
+// hands of receive threads that wait for the lock. None of them may reach a group that has been stopped.
+TEST_F(Threads, BridgeModeWhileReceiversWaitForTheLock) {
+    const watchdog dog(60s);
+    fake_tunneld tunneld(tunneld_does);
+    add_group(61, "wan0");
+    add_group(62, "wan1");
+    start_timer_thread();
+    const int first = peer.udp_socket("10.1.0.2", 2048), second = peer.udp_socket("10.2.0.2", 2048);
+    send_datagram(first, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
+    ASSERT_TRUE(soon([] { return router_count(61) == 1; }));
+    ASSERT_EQ(engine_tasks().size(), 3u);
+
+    tunneld.answer_with(tunneld_is_silent);
+    std::atomic<bool> stopped = false;
+    std::thread manager([&] {
+        EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0);
+        stopped = true;
+    });
+    tunneld.wait_for_command(); // the delete of the router's tunnel
+    send_datagram(first, "10.1.0.1", 2048, i_see_you(61, "10.1.0.3", "10.1.0.1"));
+    send_datagram(second, "10.2.0.1", 2048, i_see_you(62, "10.2.0.2", "10.2.0.1", L2));
+    std::this_thread::sleep_for(200ms);
+    EXPECT_FALSE(stopped);
+    tunneld.take_commands();
+    tunneld.answer_with(tunneld_does);
+    manager.join();
+
+    EXPECT_EQ(engine_tasks().size(), 0u);
+    EXPECT_TRUE(lock_is_free());
+    EXPECT_EQ(router_count(61), 0u);
+    EXPECT_EQ(router_count(62), 0u);
+    for (const seen_command &command : tunneld.take_commands())
+        EXPECT_NE(command.code, MAILBOX_ADD_TUNNEL);
+    const uint32_t seconds = wccp_g.seconds;
+    std::this_thread::sleep_for(1200ms);
+    EXPECT_EQ(wccp_g.seconds, seconds);
+    EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0) << "nothing is left to be stopped";
+    close(first);
+    close(second);
+}
+
+// The waiting itself, again and again: whoever of them gets the lock first, all end.
+TEST_F(Threads, BridgeModeUnderAFlood) {
+    const watchdog dog(120s);
+    fake_tunneld tunneld(tunneld_does);
+    const int router = peer.udp_socket("10.1.0.2", 2048);
+    std::atomic<bool> over = false;
+    std::thread flood([&] {
+        while (!over)
+            for (const char *id : {"10.1.0.2", "10.1.0.3", "10.1.0.4"})
+                send_datagram(router, "10.1.0.1", 2048, i_see_you(61, id, "10.1.0.1", L2));
+    });
+    for (int round = 0; round < 30; round++) {
+        add_group(61, "wan0");
+        wccp_interface *wan = wccp_if_find_interface("wan0");
+        ASSERT_TRUE(soon([] { return router_count(61) > 0; }));
+        EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0);
+        EXPECT_EQ(engine_tasks().size(), 0u);
+        EXPECT_EQ(router_count(61), 0u);
+        EXPECT_TRUE(lock_is_free());
+        wccp_del_group(61);
+        wan->rx_thread = nullptr; // only here: in the daemon no second one is made
+        const wccp_engine_lock lock;
+        wccp_init_network_by_interface(wan);
+    }
+    over = true;
+    flood.join();
+    close(router);
+}
+
+#ifndef __SANITIZE_THREAD__ // which loses count of the locks when a wait inside it is unwound
+// A receive thread that waits for an absent tunneld has the engine lock and the mailbox's. Cancelled where it
+// stands, it ends at once and takes nothing along.
+TEST_F(Threads, CancelledWhileItWaitsForTunneld) {
+    const watchdog dog(60s);
+    fake_tunneld tunneld(tunneld_does);
+    const int router = peer.udp_socket("10.1.0.2", 2048);
+    add_group(61, "wan0");
+    tunneld.take_commands();
+    tunneld.answer_with(tunneld_is_silent);
+    send_datagram(router, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
+    tunneld.wait_for_command();
+    EXPECT_FALSE(lock_is_free());
+    const auto before = steady::now();
+    cthread_cancel_all();
+    EXPECT_LT(steady::now() - before, 1s);
+    EXPECT_TRUE(lock_is_free());
+    EXPECT_EQ(wccp_mailbox->command.load(), MAILBOX_IDLE) << "the add is withdrawn";
+    EXPECT_EQ(router_count(61), 0u);
+    tunneld.answer_with(tunneld_does);
+    EXPECT_EQ(wccp_add_tunnel(61, ipa("10.1.0.1"), ipa("10.1.0.9")), 0)
+        << "tunnel mutex and mailbox are free";
+    wccp_del_group(61);
+    close(router);
+}
+#endif
+
+// The whole exit, with the reset of the mailbox and without: the groups wait for the lock, but in bounded
+// time.
+TEST_F(Threads, ExitWhileAReceiverWaitsForAnAbsentTunneld) {
+    const watchdog dog(60s);
+    fake_tunneld tunneld(tunneld_is_silent);
+    const int router = peer.udp_socket("10.1.0.2", 2048);
+
+    for (const bool reset : {false, true}) {
+        wccpd_exiting = 0;
+        if (wccp_interface *again = wccp_if_find_interface("wan0")) {
+            again->rx_thread = nullptr; // only here: in the daemon no second one is made
+            const wccp_engine_lock lock;
+            ASSERT_EQ(wccp_init_network_by_interface(again), 0);
+        }
+        tunneld.answer_with(tunneld_does);
+        const wccp_interface *wan = add_group(61, "wan0")->interfaces[0];
+        start_timer_thread();
+        tunneld.answer_with(tunneld_is_silent);
+        send_datagram(router, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
+        tunneld.wait_for_command();
+        wccpd_exiting = 1;
+        const auto before = steady::now();
+        if (reset)
+            wccp_cleanup_shmem();
+        EXPECT_EQ(wccp_exit_mgr(), 0);
+        EXPECT_LT(steady::now() - before, reset ? 3s : 6s);
+        EXPECT_EQ(engine_tasks().size(), 0u);
+        EXPECT_TRUE(lock_is_free());
+        EXPECT_EQ(wccp_g.group_count, 0u);
+        EXPECT_EQ(wan->ucast_fd, -1);
+    }
+    close(router);
+}
+
+// A notification that waited for the lock through the beginning of an exit opens nothing and starts nobody.
+TEST_F(Threads, ANotificationThatComesThroughAnExit) {
+    const watchdog dog(60s);
+    fake_tunneld tunneld(tunneld_does);
+    wccp_service_group *group = add_group(61, "wan0");
+    wccp_interface *wan = group->interfaces[0];
+    run_command(
+        "ip addr add 10.1.0.9/24 dev wan0 && ip addr del 10.1.0.1/24 dev wan0 && ip addr flush dev wan1");
+    std::thread address, link;
+    std::atomic<int> asked = 0;
+    {
+        const wccp_engine_lock lock;
+        address = std::thread([&] {
+            asked++;
+            wccp_process_if_ipa_update("wan0");
+        });
+        link = std::thread([&] {
+            qv_if_state_info info = {"wan0", 0, 0};
+            asked++;
+            wccp_process_if_state_change(&info);
+        });
+        ASSERT_TRUE(soon([&] { return asked == 2; }));
+        std::this_thread::sleep_for(100ms);
+        wccpd_exiting = 1;
+    }
+    EXPECT_EQ(wccp_exit_mgr(), 0);
+    address.join();
+    link.join();
+    EXPECT_EQ(wan->ipa_change_count, 0u);
+    EXPECT_EQ(wan->link_down_count, 0u);
+    EXPECT_EQ(engine_tasks().size(), 0u);
+    EXPECT_EQ(wan->ucast_fd, -1);
+}
+
+volatile sig_atomic_t signals_taken;
+
+// While signals pour in on the process, the engine's seconds stay seconds.
+TEST_F(Threads, SignalsDontMakeTheClockRun) {
+    const watchdog dog(60s);
+    struct sigaction action = {}, before = {};
+    action.sa_handler = [](int) { signals_taken = signals_taken + 1; };
+    action.sa_flags = SA_RESTART;
+    sigaction(SIGUSR1, &action, &before);
+    fake_tunneld tunneld(tunneld_does);
+    start_timer_thread();
+    add_group(61, "wan0"); // and a receive thread
+    ASSERT_TRUE(soon([] { return engine_tasks().size() == 2; }));
+    for (const task &one : engine_tasks())
+        EXPECT_EQ(one.blocked & (1u << (SIGUSR1 - 1)), 1u << (SIGUSR1 - 1)) << one.name;
+
+    // From here on nobody else takes the signal.
+    sigset_t blocked, open;
+    sigemptyset(&blocked);
+    sigaddset(&blocked, SIGUSR1);
+    pthread_sigmask(SIG_BLOCK, &blocked, &open);
+    const uint32_t start = [] {
+        const wccp_engine_lock lock;
+        return wccp_g.seconds;
+    }();
+    for (int i = 0; i < 300; i++) {
+        kill(getpid(), SIGUSR1);
+        std::this_thread::sleep_for(10ms);
+    }
+    uint32_t ticks;
+    {
+        const wccp_engine_lock lock;
+        ticks = wccp_g.seconds - start;
+    }
+    EXPECT_GE(ticks, 2u);
+    EXPECT_LE(ticks, 4u);
+    pthread_sigmask(SIG_SETMASK, &open, nullptr);
+    sigaction(SIGUSR1, &before, nullptr);
+}
+
+// Gives the interface another address, as "ip" would, without a process for each.
+void set_address(const char *name, const char *address) {
+    ifreq request = {};
+    strlcpy(request.ifr_name, name, sizeof request.ifr_name);
+    sockaddr_in in = {};
+    in.sin_family = AF_INET;
+    in.sin_addr.s_addr = address_word(address);
+    memcpy(&request.ifr_addr, &in, sizeof in);
+    EXPECT_EQ(ioctl(g_qvif_skfd, SIOCSIFADDR, &request), 0);
+}
+
+// Other files of the process: each opened at a number that has just been closed somewhere, with something in
+// it, and found to be whole a moment later.
+struct bystander {
+    std::atomic<bool> over = false;
+    std::atomic<uint32_t> looked = 0, robbed = 0;
+    std::thread thread;
+    bystander() : thread([this] { run(); }) {}
+    ~bystander() {
+        over = true;
+        thread.join();
+    }
+    void run() {
+        while (!over) {
+            int pairs[8][2];
+            for (auto &pair : pairs) {
+                ASSERT_EQ(socketpair(AF_UNIX, SOCK_DGRAM, 0, pair), 0);
+                for (const int end : pair)
+                    ASSERT_EQ(send(end, "mine", 4, 0), 4);
+            }
+            std::this_thread::sleep_for(300us);
+            for (auto &pair : pairs)
+                for (const int end : pair) {
+                    char text[8];
+                    looked++;
+                    if (recv(end, text, sizeof text, MSG_DONTWAIT) != 4)
+                        robbed++;
+                    close(end);
+                }
+        }
+    }
+};
+
+TEST_F(Threads, AddressesChangeAThousandTimesUnderTheReceivers) {
+    const watchdog dog(240s);
+    fake_tunneld tunneld(tunneld_does);
+    for (const auto &[id, name] : {std::pair<uint8_t, const char *>{61, "wan0"}, {62, "wan1"}})
+        add_group(id, name);
+    const int first = peer.udp_socket("10.1.0.2", 2048), second = peer.udp_socket("10.2.0.2", 2048);
+    std::atomic<bool> over = false;
+    std::thread flood([&] {
+        while (!over) {
+            send_datagram(first, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
+            send_datagram(first, "10.1.0.9", 2048, i_see_you(61, "10.1.0.2", "10.1.0.9"));
+            send_datagram(second, "10.2.0.1", 2048, i_see_you(62, "10.2.0.2", "10.2.0.1"));
+            send_datagram(second, "10.2.0.9", 2048, i_see_you(62, "10.2.0.2", "10.2.0.9"));
+        }
+    });
+    bystander others;
+    const auto change = [&](const char *name, const char *one, const char *other) {
+        for (int i = 0; i < 1000; i++) {
+            set_address(name, i % 2 ? one : other);
+            wccp_process_if_ipa_update(name);
+        }
+    };
+    std::thread second_changer(change, "wan1", "10.2.0.1", "10.2.0.9");
+    change("wan0", "10.1.0.1", "10.1.0.9");
+    second_changer.join();
+    over = true;
+    flood.join();
+
+    EXPECT_EQ(wccp_if_find_interface("wan0")->ipa_change_count, 1000u);
+    EXPECT_EQ(wccp_if_find_interface("wan1")->ipa_change_count, 1000u);
+    EXPECT_EQ(others.robbed, 0u) << "of " << others.looked;
+    EXPECT_GT(others.looked, 1000u);
+    // Both receivers are alive, and read what comes for the address of now.
+    EXPECT_EQ(engine_tasks().size(), 2u);
+    for (const uint8_t id : {uint8_t{61}, uint8_t{62}}) {
+        const uint32_t seen = [id] {
+            const wccp_engine_lock lock;
+            return wccp_find_group(id)->rx_icus;
+        }();
+        send_datagram(id == 61 ? first : second, id == 61 ? "10.1.0.1" : "10.2.0.1", 2048,
+                      i_see_you(id, id == 61 ? "10.1.0.2" : "10.2.0.2", id == 61 ? "10.1.0.1" : "10.2.0.1"));
+        EXPECT_TRUE(soon([id, seen] {
+            const wccp_engine_lock lock;
+            return wccp_find_group(id)->rx_icus > seen;
+        })) << int{id};
+    }
+    close(first);
+    close(second);
+}
+
+// Last, since the library's thread stays for good: the engine's own start, real notifications, and its end.
+TEST_F(Threads, ZTheWholeEngineFollowsTheKernel) {
+    const watchdog dog(60s);
+    ASSERT_EQ(wccp_init_mgr(), 0);
+    fake_tunneld tunneld(tunneld_does);
+    ASSERT_EQ(wccp_g.primary_if, wccp_if_find_interface("wan0"));
+    wccp_service_group *group = add_group(61, "wan0");
+    const auto locked = [](auto condition) {
+        return soon([&] {
+            const wccp_engine_lock lock;
+            return condition();
+        });
+    };
+    EXPECT_TRUE(locked([] { return wccp_g.seconds >= 1; }));
+    run_command("ip link set wan0 down");
+    EXPECT_TRUE(locked([&] { return wccp_g.primary_if->link_up == 0 && !group->hia_timer.active; }));
+    run_command("ip link set wan0 up");
+    EXPECT_TRUE(locked([&] { return wccp_g.primary_if->ready_flags == 3 && group->hia_timer.active; }));
+    run_command("ip addr del 10.1.0.1/24 dev wan0");
+    EXPECT_TRUE(locked([&] { return is_zero(group->appliance_ipa) && !group->hia_timer.active; }));
+    run_command("ip addr add 10.1.0.7/24 dev wan0");
+    EXPECT_TRUE(locked([&] { return group->appliance_ipa == ipa("10.1.0.7") && group->hia_timer.active; }));
+    const uint32_t sent = group->tx_here_i_am;
+    EXPECT_TRUE(locked([&] { return group->tx_here_i_am > sent; })) << "at the next tick";
+
+    wccpd_exiting = 1;
+    EXPECT_EQ(wccp_exit_mgr(), 0);
+    run_command("ip addr add 10.1.0.8/24 dev wan0");
+    EXPECT_EQ(engine_tasks().size(), 0u);
+    EXPECT_TRUE(lock_is_free());
+}
+
+} // namespace
