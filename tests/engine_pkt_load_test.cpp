@@ -1,0 +1,370 @@
+// What the engine writes, byte by byte, against messages written out by hand.
+
+#include "engine/wccp_pkt_load.h"
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <memory>
+
+#include "engine/wccp_pkt_mgr.h"
+#include "engine/wccp_wire.h"
+#include "tests/support/wire_bytes.h"
+
+namespace {
+
+using bytes = std::vector<uint8_t>;
+
+be32 ipa(uint8_t third, uint8_t fourth) {
+    return {{10, 0, third, fourth}};
+}
+
+// A group with no engine around it, and one zeroed packet.
+class Load : public testing::Test {
+protected:
+    void SetUp() override {
+        group->id = 50;
+        group->priority = 200;
+        group->protocol = 6;
+        group->service_flags = 0x13;
+        group->appliance_ipa = ipa(0, 100);
+        group->weight = 0x0102;
+        group->change_number = 0x01020304;
+        clear();
+    }
+    void clear() {
+        memset(static_cast<void *>(pkt.get()), 0, sizeof *pkt);
+        pkt->cursor = pkt->data;
+    }
+    void add_routers(uint32_t count) {
+        for (uint32_t i = 0; i < count; i++) {
+            wccp_sending_router *router = &routers[i];
+            router->router_id = ipa(1, static_cast<uint8_t>(i + 1));
+            router->receive_id = to_be32(0xa1a2a300 + i);
+            router->change_number = to_be32(0xc1c2c300 + i);
+            router->next = group->sending_routers;
+            group->sending_routers = router;
+        }
+        group->sending_router_count = count;
+    }
+    void add_appliances(uint32_t count) {
+        for (uint32_t i = 0; i < count; i++) {
+            appliances[i].ipa = ipa(static_cast<uint8_t>(i >> 8), static_cast<uint8_t>(100 + i));
+            appliances[i].next = group->appliance_view;
+            group->appliance_view = &appliances[i];
+        }
+        group->appliance_view_count = count;
+    }
+    void designate(uint32_t active) {
+        group->designated = 1;
+        group->dsg_key_change = 0x0a0b0c0d;
+        group->dsg_appliance_count = group->dsg_active_count = active;
+        for (uint32_t i = 0; i < active; i++)
+            group->dsg_appliances[i].ipa = ipa(0, static_cast<uint8_t>(100 + i));
+    }
+    bytes loaded() const { return {pkt->data, pkt->data + pkt->length}; }
+
+    std::unique_ptr<wccp_service_group> group{new wccp_service_group{}};
+    std::unique_ptr<wccp_pkt> pkt{new wccp_pkt{}};
+    std::unique_ptr<wccp_sending_router[]> routers{new wccp_sending_router[64]{}};
+    std::unique_ptr<wccp_view_appliance[]> appliances{new wccp_view_appliance[2048]{}};
+};
+
+const wire_bytes no_security = wire_bytes().u16(0).u16(4).u32(0);
+const wire_bytes standard_service = wire_bytes().u16(1).u16(24).u8(0).u8(50).zeros(22);
+const wire_bytes dynamic_service = wire_bytes().u16(1).u16(24).u8(1).u8(51).u8(200).u8(6).u32(0x13).zeros(16);
+
+TEST_F(Load, TheFirstHereIAmOfAStandardGroup) {
+    const wire_bytes identity =
+        wire_bytes().u16(3).u16(44).ip(0, 100).u16(0).u16(0).zeros(32).u16(0x0102).u16(0);
+    const wire_bytes view = wire_bytes().u16(5).u16(12).u32(0x01020304).u32(0).u32(0);
+    ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
+    EXPECT_EQ(loaded(), wire_message(10, {no_security, standard_service, identity, view}));
+    EXPECT_EQ(pkt->length, 108u);
+    EXPECT_EQ(pkt->data[7], 100);
+    EXPECT_EQ(pkt->cursor, pkt->data + 108);
+    EXPECT_EQ(pkt->offset, 108u);
+}
+
+// All that a Here-I-Am can hold. The digest is what md5sum gives for the password's eight bytes and this
+// message with sixteen zeros in its place.
+TEST_F(Load, AFullHereIAmWithItsDigest) {
+    group->id = 90;
+    group->security_option = 1;
+    memcpy(group->password, "pass", 4);
+    group->fwd_method = group->ret_method = WCCP_METHOD_L2;
+    group->assign_method = WCCP_ASSIGN_MASK;
+    group->mask_src_ip = 0x1741;
+    group->mask_dst_ip = 0xf00;
+    group->mask_src_port = 0x21;
+    group->mask_dst_port = 0x8001;
+    group->mask_in_use = {1, 2, 3, 4}; // not what is announced
+    group->state_flags = WCCP_STATE_ACTIVE | WCCP_SHUTTING_DOWN;
+    add_routers(2);
+    add_appliances(3);
+    routers[0].receive_id = to_be32(0xb1b2b3b4);
+    routers[0].router_id = ipa(1, 2);
+    routers[1].receive_id = to_be32(0xa1a2a3a4);
+    routers[1].router_id = ipa(1, 1);
+    std::swap(appliances[0].ipa, appliances[2].ipa);
+    const wire_bytes security = wire_bytes().u16(0).u16(20).u32(1).hex("de4e3731fbfbdacecf23601043c72c24");
+    const wire_bytes service = wire_bytes().u16(1).u16(24).u8(1).u8(90).u8(200).u8(6).u32(0x13).zeros(16);
+    const wire_bytes identity = wire_bytes()
+                                    .u16(3)
+                                    .u16(32)
+                                    .ip(0, 100)
+                                    .u16(0)
+                                    .u16(2)
+                                    .u32(1)
+                                    .u32(0x1741)
+                                    .u32(0xf00)
+                                    .u16(0x21)
+                                    .u16(0x8001)
+                                    .u32(0)
+                                    .u16(0x0102)
+                                    .u16(0);
+    const wire_bytes view = wire_bytes()
+                                .u16(5)
+                                .u16(40)
+                                .u32(0x01020304)
+                                .u32(2)
+                                .ip(1, 1)
+                                .u32(0xa1a2a3a4)
+                                .ip(1, 2)
+                                .u32(0xb1b2b3b4)
+                                .u32(3)
+                                .ip(0, 100)
+                                .ip(0, 101)
+                                .ip(0, 102);
+    const wire_bytes capabilities = wire_bytes().u16(8).u16(24).hex(
+        "00 01 00 04 00 00 00 02  00 02 00 04 00 00 00 02  00 03 00 04 00 00 00 02");
+    const wire_bytes command = wire_bytes().u16(15).u16(8).u16(1).u16(4).ip(0, 100);
+    ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
+    EXPECT_EQ(loaded(), wire_message(10, {security, service, identity, view, capabilities, command}));
+
+    // All eight bytes of a password count, and so does all of the message.
+    const auto digest = [this] {
+        clear();
+        EXPECT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
+        return bytes(pkt->data + 16, pkt->data + 32);
+    };
+    memcpy(group->password, "password", 8);
+    EXPECT_EQ(digest(), wire_bytes().hex("1d053b8d790be5611ed1d0d64453102a").bytes);
+    group->change_number++;
+    EXPECT_NE(digest(), wire_bytes().hex("1d053b8d790be5611ed1d0d64453102a").bytes);
+}
+
+TEST_F(Load, CapabilitiesAreWhatDiffersFromTheDefaults) {
+    const struct {
+        uint32_t fwd, assign, ret;
+        const char *expected;
+    } rows[] = {
+        {0, 0, 0, ""},
+        {1, 1, 1, ""},
+        {2, 1, 1, "0008 0008 0001 0004 00000002"},
+        {1, 2, 0, "0008 0008 0002 0004 00000002"},
+        {1, 1, 2, "0008 0008 0003 0004 00000002"},
+        {2, 1, 2, "0008 0010 0001 0004 00000002 0003 0004 00000002"},
+    };
+    for (const auto &row : rows) {
+        clear();
+        group->fwd_method = row.fwd;
+        group->assign_method = row.assign;
+        group->ret_method = row.ret;
+        EXPECT_EQ(wccp_pkt_load_capability_info_component(group.get(), pkt.get()), 0);
+        EXPECT_EQ(loaded(), wire_bytes().hex(row.expected).bytes);
+    }
+}
+
+TEST_F(Load, ARedirectAssignByHash) {
+    group->id = 51;
+    group->assign_method = WCCP_ASSIGN_HASH;
+    add_routers(2);
+    designate(3);
+    for (uint32_t i = 0; i < 256; i++)
+        group->bucket_index[i] = static_cast<uint8_t>(i % 3);
+    wire_bytes assignment = wire_bytes()
+                                .u16(6)
+                                .u16(272 + 24 + 12)
+                                .ip(0, 100)
+                                .u32(0x0a0b0c0d)
+                                .u32(2)
+                                .ip(1, 2)
+                                .u32(0xa1a2a301)
+                                .u32(0xc1c2c301)
+                                .ip(1, 1)
+                                .u32(0xa1a2a300)
+                                .u32(0xc1c2c300)
+                                .u32(3)
+                                .ip(0, 100)
+                                .ip(0, 101)
+                                .ip(0, 102);
+    for (uint32_t i = 0; i < 256; i++)
+        assignment.u8(i % 3);
+    ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+    EXPECT_EQ(loaded(), wire_message(12, {no_security, dynamic_service, assignment}));
+    clear();
+    ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+    EXPECT_EQ(routers[0].assign_tx_count, 2u);
+    EXPECT_EQ(routers[1].assign_tx_count, 2u);
+    EXPECT_EQ(routers[2].assign_tx_count, 0u);
+}
+
+TEST_F(Load, ARedirectAssignByMask) {
+    group->id = 51;
+    group->assign_method = WCCP_ASSIGN_MASK;
+    add_routers(1);
+    add_appliances(1);
+    designate(1);
+    group->mask_dst_ip = 0xffffffff; // configured, replaced
+    group->mask_in_use = {0x01020304, 0x00000f00, 0x0506, 0x0708};
+    group->mask_value_count = 2;
+    group->mask_values[0] = {0, 0x100, 0, 0x0700, ipa(0, 101)};
+    group->mask_values[1] = {0x01000000, 0, 0x0506, 0, ipa(0, 100)};
+    const wire_bytes assignment = wire_bytes()
+                                      .u16(13)
+                                      .u16(36 + 12 + 32)
+                                      .u16(1)
+                                      .u16(32 + 12 + 32)
+                                      .ip(0, 100)
+                                      .u32(0x0a0b0c0d)
+                                      .u32(1)
+                                      .ip(1, 1)
+                                      .u32(0xa1a2a300)
+                                      .u32(0xc1c2c300)
+                                      .u32(1)
+                                      .u32(0x01020304)
+                                      .u32(0xf00)
+                                      .u16(0x0506)
+                                      .u16(0x0708)
+                                      .u32(2)
+                                      .u32(0)
+                                      .u32(0x100)
+                                      .u16(0)
+                                      .u16(0x0700)
+                                      .ip(0, 101)
+                                      .u32(0x01000000)
+                                      .u32(0)
+                                      .u16(0x0506)
+                                      .u16(0)
+                                      .ip(0, 100);
+    ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+    EXPECT_EQ(loaded(), wire_message(12, {no_security, dynamic_service, assignment}));
+    EXPECT_EQ(routers[0].assign_tx_count, 1u);
+}
+
+TEST_F(Load, TheLargestMessagesFit) {
+    group->security_option = 1;
+    add_routers(32);
+    add_appliances(32);
+    designate(32);
+    group->mask_value_count = 128;
+    group->assign_method = WCCP_ASSIGN_HASH;
+    EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+    EXPECT_EQ(pkt->length, 8u + 24 + 28 + 276 + 12 * 32 + 4 * 32);
+    clear();
+    group->assign_method = WCCP_ASSIGN_MASK;
+    EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+    EXPECT_EQ(pkt->length, 8u + 24 + 28 + 40 + 12 * 32 + 16 * 128);
+    clear();
+    EXPECT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
+    EXPECT_EQ(pkt->length, 8u + 24 + 28 + 36 + 16 + 8 * 32 + 4 * 32 + 12);
+}
+
+TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
+    add_routers(1);
+    add_appliances(1);
+    designate(1);
+    group->mask_value_count = 1;
+    const auto refused = [this] {
+        const uint32_t sent = routers[0].assign_tx_count;
+        int count = 0;
+        for (const uint32_t method : {WCCP_ASSIGN_HASH, WCCP_ASSIGN_MASK}) {
+            clear();
+            group->assign_method = method;
+            count += wccp_pkt_build_redirect_assign(group.get(), pkt.get()) == 1 && pkt->length == 44;
+        }
+        return count == 2 && routers[0].assign_tx_count == sent;
+    };
+    EXPECT_FALSE(refused());
+    group->designated = 0;
+    EXPECT_TRUE(refused());
+    group->designated = 1;
+    group->sending_router_count = 0;
+    EXPECT_TRUE(refused());
+    group->sending_router_count = 1;
+    group->dsg_active_count = group->mask_value_count = 0;
+    EXPECT_TRUE(refused());
+    group->dsg_active_count = 33;
+    group->mask_value_count = 129;
+    EXPECT_TRUE(refused());
+    group->dsg_active_count = group->mask_value_count = 1;
+    group->appliance_view_count = 0; // asked of the mask form alone
+    group->assign_method = WCCP_ASSIGN_MASK;
+    clear();
+    EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 1);
+    group->assign_method = WCCP_ASSIGN_NONE;
+    clear();
+    EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 1);
+}
+
+// Each component goes to the last byte of the packet and not one byte further.
+TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
+    group->security_option = 1;
+    group->fwd_method = group->assign_method = group->ret_method = 2;
+    add_routers(3);
+    add_appliances(2);
+    designate(2);
+    group->mask_value_count = 5;
+    using load = int (*)(wccp_service_group *, wccp_pkt *);
+    const struct {
+        uint32_t size;
+        load function;
+    } rows[] = {
+        {8, [](wccp_service_group *, wccp_pkt *to) { return wccp_pkt_load_msg_header(to, WCCP_HERE_I_AM); }},
+        {24,
+         [](wccp_service_group *from, wccp_pkt *to) {
+             uint8_t *digest;
+             return wccp_pkt_load_security_info_component(from, to, &digest);
+         }},
+        {28, wccp_pkt_load_service_info_component},
+        {36, wccp_pkt_load_web_cache_identity_info_component},
+        {16 + 8 * 3 + 4 * 2, wccp_pkt_load_web_cache_view_info_component},
+        {276 + 12 * 3 + 4 * 2, wccp_pkt_load_assignment_info_component},
+        {40 + 12 * 3 + 16 * 5, wccp_pkt_load_mask_assignment_info_component},
+        {28, wccp_pkt_load_capability_info_component},
+        {12, wccp_pkt_load_command_ext_component},
+    };
+    for (const auto &row : rows) {
+        for (const uint32_t missing : {0u, 1u}) {
+            clear();
+            pkt->length = pkt->offset = 4096 - row.size + missing;
+            pkt->cursor = pkt->data + pkt->offset;
+            const auto before = std::make_unique<wccp_pkt>(*pkt);
+            EXPECT_EQ(row.function(group.get(), pkt.get()), static_cast<int>(missing)) << row.size;
+            if (missing)
+                EXPECT_EQ(memcmp(before.get(), pkt.get(), sizeof *pkt), 0) << row.size;
+            else
+                EXPECT_TRUE(pkt->length == 4096 && pkt->offset == 4096 && pkt->cursor == pkt->data + 4096);
+        }
+    }
+}
+
+TEST_F(Load, AViewThatIsTooLargeOrMiscountedIsRefused) {
+    add_routers(32);
+    add_appliances(955); // 16 + 256 + 3820 bytes, behind 4
+    pkt->length = pkt->offset = 4;
+    EXPECT_EQ(wccp_pkt_load_web_cache_view_info_component(group.get(), pkt.get()), 0);
+    EXPECT_EQ(pkt->length, 4096u);
+    clear();
+    EXPECT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 1);
+    for (uint32_t *count : {&group->sending_router_count, &group->appliance_view_count}) {
+        clear();
+        --*count;
+        EXPECT_EQ(wccp_pkt_load_web_cache_view_info_component(group.get(), pkt.get()), 1);
+        EXPECT_EQ(pkt->length, 0u);
+        ++*count;
+    }
+}
+
+} // namespace
