@@ -211,10 +211,10 @@ TEST_F(Link, AnAddressComesChangesAndGoes) {
                   (std::vector<uint8_t>{10, 1, 0, 1}));
     }
 
-    // The farewell of the old address comes from the old socket, though the interface has it no more.
+    // The farewell of the old address comes from the old socket, as long as the kernel lets it.
     make_active(group);
-    run_command("ip addr add 10.1.0.7/24 dev wan0 && ip addr del 10.1.0.1/24 dev wan0 && "
-                "ip addr add 10.1.0.1/32 dev lo");
+    run_command(
+        "ip addr flush dev wan0 && ip addr add 10.1.0.7/24 dev wan0 && ip addr add 10.1.0.1/32 dev lo");
     const be32 old_ipa = group->appliance_ipa;
     wccp_process_if_ipa_update("wan0");
     const datagram farewell = receive_datagram(router);
