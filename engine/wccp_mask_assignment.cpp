@@ -94,10 +94,13 @@ int wccp_mask_assignment_assign_mask_values(wccp_service_group *group) {
     }
     for (uint32_t i = 0; i < group->dsg_active_count; i++)
         group->dsg_appliances[i].assigned = 0;
+    wccp_dsg_appliance *owner = nullptr;
     for (uint32_t i = 0; i < group->mask_value_count; i++) {
-        group->mask_values[i].appliance_ipa = group->bucket_ipa[i];
-        if (wccp_dsg_appliance *owner =
-                wccp_find_dsg_appliance(group, group->dsg_active_count, group->bucket_ipa[i]))
+        const be32 address = group->bucket_ipa[i];
+        group->mask_values[i].appliance_ipa = address;
+        if (i == 0 || !(address == group->bucket_ipa[i - 1])) // values come in runs
+            owner = wccp_find_dsg_appliance(group, group->dsg_active_count, address);
+        if (owner)
             owner->assigned++;
     }
     const wccp_mask &mask = group->mask_in_use;

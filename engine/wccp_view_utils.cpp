@@ -9,8 +9,8 @@
 // pointer to one.
 //
 // The engine lock is held throughout, by a receive thread, or by the timer thread when a silent router is
-// taken out. In steady state a report equals the one before it, entry by entry, and costs a comparison and a
-// copy: an address is looked for at its old place first, and only then anywhere else.
+// taken out. In steady state a report repeats the one before it, entry by entry, and costs a comparison and a
+// copy. Otherwise an address is looked for at its old place first, and only then anywhere else.
 //
 // A report may name an address more than once. Each mention is matched with an old mention of its own, so
 // that the union's counts and the arrays stay in step whatever follows; and this appliance counts as lost
@@ -146,10 +146,21 @@ static int add_router_mention(wccp_service_group *group, be32 address) {
     return 0;
 }
 
+static bool repeats_last_report(const wccp_sending_router *router, uint32_t count, const be32 *addresses) {
+    if (count != router->view_router_count)
+        return false;
+    for (uint32_t i = 0; i < count; i++)
+        if (!(router->view_routers[i].ipa == addresses[i]))
+            return false;
+    return true;
+}
+
 int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                             const be32 *addresses) {
     if (count > WCCP_MAX_ROUTERS)
         return 1;
+    if (repeats_last_report(router, count, addresses))
+        return 0;
     const uint32_t old_count = router->view_router_count;
     bool changed = false;
     clear_marks(router->view_routers, old_count);
@@ -305,13 +316,37 @@ static bool lists(const wccp_rtr_view_appliance *entries, uint32_t count, be32 a
     return false;
 }
 
-int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
-                               const wccp_rtr_view_appliance *decoded) {
-    if (count > WCCP_MAX_APPLIANCES)
-        return 1;
+// The same appliances with the same weights, in the same order: nothing moves but what is assigned to them.
+static bool repeats_last_report(const wccp_sending_router *router, uint32_t count,
+                                const wccp_rtr_view_appliance *decoded) {
+    if (count != router->view_appliance_count)
+        return false;
+    for (uint32_t i = 0; i < count; i++) {
+        const wccp_rtr_view_appliance *old = &router->view_appliances[i];
+        if (!(old->ipa == decoded[i].ipa) || old->weight != decoded[i].weight)
+            return false;
+    }
+    return true;
+}
+
+static void copy_report(wccp_sending_router *router, uint32_t count, const wccp_rtr_view_appliance *decoded) {
+    for (uint32_t i = 0; i < count; i++) {
+        wccp_rtr_view_appliance *entry = &router->view_appliances[i];
+        entry->ipa = decoded[i].ipa;
+        entry->weight = decoded[i].weight;
+        entry->buckets_assigned = decoded[i].buckets_assigned;
+        entry->buckets_total = decoded[i].buckets_total;
+        if (decoded[i].buckets_assigned != 0)
+            memcpy(entry->bucket_bits, decoded[i].bucket_bits, sizeof entry->bucket_bits);
+    }
+    router->view_appliance_count = count;
+}
+
+// Moves the union and the connection by what is new in a report, and what is gone. Tells whether anything is.
+static int take_changes(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
+                        const wccp_rtr_view_appliance *decoded, bool *out_changed) {
     const uint32_t old_count = router->view_appliance_count;
     wccp_rtr_view_appliance *const old = router->view_appliances;
-    bool changed = false;
     clear_marks(old, old_count);
     for (uint32_t i = 0; i < count; i++) {
         const wccp_rtr_view_appliance *element = &decoded[i];
@@ -322,7 +357,7 @@ int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *r
         }
         if (add_appliance_mention(group, element))
             return 1;
-        changed = true;
+        *out_changed = true;
         if (element->ipa == group->appliance_ipa)
             router_has_seen_us(group, router);
     }
@@ -330,19 +365,21 @@ int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *r
         if (old[i].flags & MARK)
             continue;
         wccp_remove_appliance_from_view_list(group, old[i].ipa);
-        changed = true;
+        *out_changed = true;
         if (old[i].ipa == group->appliance_ipa && !lists(decoded, count, old[i].ipa))
             router_has_lost_us(group, router);
     }
-    for (uint32_t i = 0; i < count; i++) {
-        old[i].ipa = decoded[i].ipa;
-        old[i].weight = decoded[i].weight;
-        old[i].buckets_assigned = decoded[i].buckets_assigned;
-        old[i].buckets_total = decoded[i].buckets_total;
-        if (decoded[i].buckets_assigned != 0)
-            memcpy(old[i].bucket_bits, decoded[i].bucket_bits, sizeof old[i].bucket_bits);
-    }
-    router->view_appliance_count = count;
+    return 0;
+}
+
+int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
+                               const wccp_rtr_view_appliance *decoded) {
+    if (count > WCCP_MAX_APPLIANCES)
+        return 1;
+    bool changed = false;
+    if (!repeats_last_report(router, count, decoded) && take_changes(group, router, count, decoded, &changed))
+        return 1;
+    copy_report(router, count, decoded);
     if (changed)
         view_has_changed(group, router, "appliance");
     return 0;

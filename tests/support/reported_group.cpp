@@ -7,13 +7,13 @@
 #include "engine/wccp_router_utils.h"
 #include "engine/wccp_view_utils.h"
 
-reported_group::reported_group(bool started) {
+reported_group::reported_group(bool started, uint8_t id) {
     strcpy(interface.name, "lan0");
     interface.ipa = US;
     interface.ready_flags = WCCP_ALL_READY;
     interface.ucast_fd = interface.mcast_fd = -1;
     group = static_cast<wccp_service_group *>(wccp_malloc(sizeof *group));
-    group->id = 51;
+    group->id = id;
     group->admin_state = WCCP_ADMIN_UP;
     group->appliance_ipa = US;
     group->weight = 100;

@@ -16,8 +16,8 @@ constexpr be32 ROUTER_A = host(201), ROUTER_B = host(202), ROUTER_C = host(203);
 using reported_appliances = std::vector<std::pair<be32, uint16_t>>; // address and weight
 
 struct reported_group {
-    // Group 51, enabled, in the engine's tables; started, or as an addition leaves it.
-    explicit reported_group(bool started);
+    // An enabled group in the engine's tables; started, or as an addition leaves it.
+    explicit reported_group(bool started, uint8_t id = 51);
     ~reported_group(); // takes it out again, with all that it has
     reported_group(const reported_group &) = delete;
     reported_group &operator=(const reported_group &) = delete;

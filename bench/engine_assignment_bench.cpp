@@ -1,0 +1,186 @@
+// What the engine computes by itself: the designated appliance's table, a tick of all groups, and the views
+// of one I-See-You that says what the last one said. Each figure comes with its ratio to a floor measured in
+// the same run: work that nobody could leave out.
+#include <algorithm>
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <vector>
+
+#include <benchmark/benchmark.h>
+
+#include "engine/wccp_assignment.h"
+#include "engine/wccp_router_utils.h"
+#include "engine/wccp_view_utils.h"
+#include "engine/wccp_wire.h"
+#include "runtime/logging.h"
+#include "runtime/md5.h"
+#include "tests/support/reported_group.h"
+
+namespace {
+
+using clock_type = std::chrono::steady_clock;
+
+double seconds_since(clock_type::time_point begin) {
+    return std::chrono::duration<double>(clock_type::now() - begin).count();
+}
+
+// The best of some rounds.
+template <typename Work>
+double seconds_each(Work work) {
+    double best = 1e9;
+    for (int round = 0; round < 7; round++) {
+        uint64_t calls = 0;
+        const auto begin = clock_type::now();
+        do {
+            for (int i = 0; i < 16; i++)
+                work();
+            calls += 16;
+        } while (seconds_since(begin) < 0.01);
+        best = std::min(best, seconds_since(begin) / static_cast<double>(calls));
+    }
+    return best;
+}
+
+// Runs the benchmark's loop, and tells how many floors one turn costs.
+template <typename Work>
+void run_against(benchmark::State &state, double floor, Work work) {
+    G_log_level = LC_LOG_EMERG;
+    const auto begin = clock_type::now();
+    for (auto _ : state)
+        work();
+    const double each = seconds_since(begin) / static_cast<double>(state.iterations());
+    state.counters["floor_ns"] = floor * 1e9;
+    state.counters["x_floor"] = each / floor;
+}
+
+wccp_service_group *group_with_appliances(const reported_group &shared, uint32_t method) {
+    wccp_service_group *group = shared.group;
+    group->assign_method = method;
+    group->mask_dst_ip = 0x1741;
+    group->mask_src_ip = 1;
+    group->mask_src_port = 1;
+    group->mask_bits = 7;
+    return group;
+}
+
+// 32 appliances, one of which has just gone. The floor: the same entries sorted and a table written once.
+void table(benchmark::State &state, uint32_t method) {
+    const reported_group shared(false);
+    wccp_service_group *group = group_with_appliances(shared, method);
+    std::vector<wccp_view_appliance> appliances(WCCP_MAX_APPLIANCES);
+    for (uint32_t i = 0; i < WCCP_MAX_APPLIANCES; i++)
+        appliances[i] = {nullptr, nullptr, host(i * 7 % 32 + 1), static_cast<uint16_t>(i * 13 + 1), 1};
+    const auto add = [&](uint32_t count) {
+        wccp_designated_appliance_assignment_start(group);
+        for (uint32_t i = 0; i < count; i++)
+            wccp_designated_appliance_assignment_add(group, &appliances[i]);
+    };
+    add(WCCP_MAX_APPLIANCES);
+    wccp_designated_appliance_assignment_finish(group);
+    wccp_dsg_appliance before[WCCP_MAX_APPLIANCES];
+    memcpy(before, group->dsg_appliances, sizeof before);
+    const uint32_t slots = group->bucket_count;
+
+    const double floor = seconds_each([&] {
+        wccp_dsg_appliance entries[WCCP_MAX_APPLIANCES];
+        memcpy(entries, before, sizeof entries);
+        qsort(entries, WCCP_MAX_APPLIANCES, sizeof entries[0], [](const void *a, const void *b) {
+            return static_cast<int>(*static_cast<const uint32_t *>(a) - *static_cast<const uint32_t *>(b));
+        });
+        for (uint32_t slot = 0; slot < slots; slot++)
+            group->bucket_ipa[slot] = entries[slot / 8].ipa;
+        benchmark::DoNotOptimize(group->bucket_ipa);
+        benchmark::ClobberMemory();
+    });
+    run_against(state, floor, [&] {
+        memcpy(group->dsg_appliances, before, sizeof before);
+        group->dsg_appliance_count = WCCP_MAX_APPLIANCES;
+        add(WCCP_MAX_APPLIANCES - 1);
+        wccp_designated_appliance_assignment_finish(group);
+        benchmark::ClobberMemory();
+    });
+}
+void table_of_256_hash_buckets(benchmark::State &state) {
+    table(state, WCCP_ASSIGN_HASH);
+}
+void table_of_128_mask_values(benchmark::State &state) {
+    table(state, WCCP_ASSIGN_MASK);
+}
+BENCHMARK(table_of_256_hash_buckets);
+BENCHMARK(table_of_128_mask_values);
+
+// 256 groups of 32 routers, each tick with its share of Here-I-Am messages (built, not sent) and sweeps. The
+// floor: one look at each router.
+void tick_of_256_groups(benchmark::State &state) {
+    std::vector<std::unique_ptr<reported_group>> groups;
+    std::vector<be32> routers;
+    reported_appliances appliances;
+    for (uint32_t i = 0; i < 32; i++) {
+        routers.push_back(host(i + 200));
+        appliances.push_back({host(i + 1), 100});
+    }
+    for (uint32_t id = 0; id < WCCP_MAX_GROUPS; id++) {
+        groups.push_back(std::make_unique<reported_group>(true, static_cast<uint8_t>(id)));
+        groups.back()->group->hia_timer.countdown = id % 10 + 1;
+        groups.back()->group->monitor_timer.countdown = id % 5 + 1;
+        for (const be32 router : routers)
+            groups.back()->see(router, routers, appliances);
+    }
+    G_log_level = LC_LOG_EMERG;
+    pass_seconds(1); // the elections
+    const double floor = seconds_each([] {
+        for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
+            for (wccp_sending_router *router = group->sending_routers; router; router = router->next)
+                benchmark::DoNotOptimize(router->last_icu_time);
+    });
+    run_against(state, floor, [] {
+        wccp_tick();
+        wccp_g.seconds--; // or the routers would go
+    });
+}
+BENCHMARK(tick_of_256_groups)->Unit(benchmark::kMicrosecond);
+
+// Router view, web-cache elements and redirect status of 32 routers and 32 appliances, nothing new in them.
+// The floor: MD5 over the message that brings them.
+void views_of_an_unchanged_report(benchmark::State &state) {
+    const reported_group shared(false);
+    wccp_service_group *group = shared.group;
+    std::vector<be32> routers;
+    std::vector<wccp_wire_view_element_hash> elements(WCCP_MAX_APPLIANCES);
+    for (uint32_t i = 0; i < 32; i++) {
+        routers.push_back(host(i + 200));
+        elements[i] = {
+            .head = {host(i + 1), {}, {}}, .bucket_words = {}, .weight = to_be16(100), .status = {}};
+        elements[i].bucket_words[i / 4] = to_be32(0xffu << (i % 4 * 8));
+    }
+    wccp_sending_router *router = shared.router(ROUTER_A);
+    wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES];
+    const auto take = [&] {
+        wccp_assign_summary hash, mask = {};
+        memset(decoded, 0, sizeof decoded);
+        if (wccp_update_router_view(group, router, 32, routers.data()) ||
+            wccp_process_router_view_web_cache_id_elements(
+                group, 32, reinterpret_cast<const uint8_t *>(elements.data()), decoded, &hash) ||
+            wccp_update_appliance_view(group, router, 32, decoded) ||
+            wccp_update_appliance_redirect_status(group, router, &hash, &mask))
+            abort();
+    };
+    take();
+    std::vector<uint8_t> message(8 + 24 + 28 + 20 + 24 + 32 * 4 + 32 * 44, 0x5a);
+    const double floor = seconds_each([&] {
+        md5_state md5;
+        uint8_t digest[16];
+        md5_init(&md5);
+        md5_append(&md5, message.data(), static_cast<int>(message.size()));
+        md5_finish(&md5, digest);
+        benchmark::DoNotOptimize(digest);
+    });
+    run_against(state, floor, take);
+}
+BENCHMARK(views_of_an_unchanged_report);
+
+} // namespace
+
+BENCHMARK_MAIN();
