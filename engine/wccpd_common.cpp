@@ -6,9 +6,10 @@
 // an L2 return that timed out is still pending and tunneld may be reading it; it is written last, with
 // release order, and the answer is looked for with acquire order.
 //
-// The wait is a poll of one millisecond, two thousand times, and a cancellation point. A thread cancelled
-// there lets go of the mutex on its way out and withdraws an add, as after a time-out: nobody would know the
-// tunnel that came of it.
+// The wait is a poll of one millisecond, two thousand times. Between two polls, once there is no answer yet,
+// it is a cancellation point: an answer that has come is taken, and a thread cancelled before lets go of the
+// mutex on its way out and withdraws an add, as after a time-out, since nobody would know the tunnel that
+// came of it.
 //
 // The reset at exit runs on the main thread while an engine thread may be waiting. It raises `abandon`, which
 // ends a wait at its next look with the result of a time-out, then waits for the mutex, and only then
@@ -148,7 +149,10 @@ bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32
     pending_command pending = {mailbox, kind->code, false};
     mailbox->command.store(kind->code, std::memory_order_release);
     for (int i = 0; i < ANSWER_POLLS; i++) {
-        poll(nullptr, 0, 1);
+        {
+            const cancel_off_guard whole;
+            poll(nullptr, 0, 1);
+        }
         if (mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE) {
             pending.answered = true;
             *out_status = get(mailbox->status);
@@ -157,6 +161,7 @@ bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32
         }
         if (abandon.load(std::memory_order_acquire))
             return false;
+        pthread_testcancel();
     }
     QV_LOG(kind->time_out_level, "%s", kind->time_out_line);
     return false;

@@ -1,0 +1,330 @@
+// wccpd and tunneld at the mailbox, each on threads of its own.
+
+#include "engine/wccpd_common.h"
+
+#include <gtest/gtest.h>
+#include <pthread.h>
+
+#include <chrono>
+#include <cstring>
+#include <thread>
+#include <vector>
+
+#include "tests/support/fake_tunneld.h"
+
+using namespace std::chrono_literals;
+
+namespace {
+
+mailbox_address address(uint32_t host_order) {
+    return {{host_order, 0}};
+}
+
+double seconds_of(const std::function<void()> &work) {
+    const auto begin = std::chrono::steady_clock::now();
+    work();
+    return std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+}
+
+struct Mailbox : testing::Test {
+    static void SetUpTestSuite() {
+        write_mem_conf();
+        EXPECT_EQ(wccp_get_tunnel_command(), 0) << "no block yet";
+        EXPECT_EQ(wccp_get_role(7), 2u);
+        EXPECT_EQ(wccp_get_fmst_index(), WCCP_NO_INDEX);
+        wccp_set_tunnel_command_status(0);
+        uint32_t index = 5;
+        EXPECT_EQ(wccp_add_tunnel_encap(1, address(1), address(2), &index), 1);
+        EXPECT_EQ(wccp_cleanup_shmem(), 0);
+        ASSERT_EQ(wccp_init_shmem(), 0);
+        EXPECT_EQ(wccp_get_fmst_index(), WCCP_NO_INDEX);
+        EXPECT_EQ(wccp_init_shmem(), 1) << "its creator lives";
+        ASSERT_TRUE(wccp_mailbox);
+    }
+    void TearDown() override { wccp_cleanup_shmem(); }
+};
+
+} // namespace
+
+TEST_F(Mailbox, AResetLeavesEveryRoleUnknown) {
+    wccp_mailbox->policy_roles[65535].role = 0;
+    wccp_mailbox->l2_value = 7;
+    EXPECT_EQ(wccp_cleanup_shmem(), 0);
+    EXPECT_EQ(wccp_get_fmst_index(), 0u);
+    const char zeroes[28] = {};
+    EXPECT_EQ(memcmp(static_cast<void *>(wccp_mailbox), zeroes, sizeof zeroes), 0);
+    for (uint32_t i = 0; i < WCCP_POLICY_GROUPS; i++) {
+        ASSERT_EQ(wccp_mailbox->policy_roles[i].policy_group, i);
+        ASSERT_EQ(wccp_get_role(static_cast<uint16_t>(i)), 2u);
+    }
+}
+
+TEST_F(Mailbox, AnswersComeBackAsTheyWereGiven) {
+    static const struct {
+        tunneld_answer answer;
+        int add, other;
+        uint32_t index;
+    } cases[] = {
+        {{0, 77}, 0, 0, 77},
+        {{1, 77}, 1, 1, 77},
+        {{5, 78}, 5, 5, 78},
+        {{0, WCCP_NO_INDEX}, 1, 0, WCCP_NO_INDEX},
+    };
+    for (const auto &row : cases) {
+        fake_tunneld tunneld([&](const seen_command &) { return row.answer; });
+        uint32_t index = WCCP_NO_INDEX;
+        EXPECT_EQ(wccp_add_tunnel_encap(300, address(0x0A000001), address(0xFFFFFFFE), &index), row.add);
+        EXPECT_EQ(index, row.index);
+        index = 4;
+        EXPECT_EQ(wccp_del_tunnel_encap(65534, address(0x0A000001), address(0xC0A80001), &index), row.other);
+        EXPECT_EQ(index, row.index);
+        EXPECT_EQ(wccp_set_L2_return(255, 0xABCD1234), row.other);
+        const std::vector<seen_command> commands = tunneld.take_commands();
+        ASSERT_EQ(commands.size(), 3u);
+        EXPECT_EQ(commands[0].code, 2);
+        EXPECT_EQ(commands[0].tunnel_id, 300);
+        EXPECT_EQ(commands[0].local, 0x0A000001u);
+        EXPECT_EQ(commands[0].remote, 0xFFFFFFFEu);
+        EXPECT_EQ(commands[0].index, WCCP_NO_INDEX);
+        EXPECT_EQ(commands[1].code, 1);
+        EXPECT_EQ(commands[1].tunnel_id, 65534);
+        EXPECT_EQ(commands[1].remote, 0xC0A80001u);
+        EXPECT_EQ(commands[1].index, 4u);
+        EXPECT_EQ(commands[2].code, 3);
+        EXPECT_EQ(commands[2].l2_group, 255);
+        EXPECT_EQ(commands[2].l2_value, 0xABCD1234u);
+    }
+}
+
+TEST_F(Mailbox, WithoutTunneldEachCommandEndsAfterTwoSeconds) {
+    uint32_t index = 42;
+    double took = seconds_of([&] { EXPECT_EQ(wccp_del_tunnel_encap(9, address(1), address(2), &index), 1); });
+    EXPECT_GE(took, 1.9);
+    EXPECT_LT(took, 8);
+    EXPECT_EQ(wccp_get_tunnel_command(), 1) << "a delete may still be carried out";
+    took = seconds_of([&] { EXPECT_EQ(wccp_set_L2_return(3, 1), 1); });
+    EXPECT_GE(took, 1.9);
+    EXPECT_EQ(wccp_get_tunnel_command(), 3);
+    took = seconds_of([&] { EXPECT_EQ(wccp_add_tunnel_encap(9, address(1), address(2), &index), 1); });
+    EXPECT_GE(took, 1.9);
+    EXPECT_EQ(wccp_get_tunnel_command(), 0) << "an add is withdrawn";
+    EXPECT_EQ(index, 42u);
+}
+
+// Each caller's numbers hang together, and each gets the answer to its own command.
+TEST_F(Mailbox, CommandsNeverOverlap) {
+    std::atomic<int> torn = 0, wrong = 0;
+    fake_tunneld tunneld([&](const seen_command &command) {
+        if (command.code != MAILBOX_L2_RETURN &&
+            (command.local != command.tunnel_id * 3u || command.remote != command.tunnel_id * 5u))
+            torn++;
+        return tunneld_does(command);
+    });
+    std::vector<std::thread> callers;
+    for (uint16_t caller = 0; caller < 4; caller++) {
+        callers.emplace_back([caller, &wrong] {
+            for (uint16_t i = 0; i < 60; i++) {
+                const auto id = static_cast<uint16_t>(1000 + caller * 100 + i);
+                uint32_t index = 0;
+                const auto give = i % 2 ? wccp_add_tunnel_encap : wccp_del_tunnel_encap;
+                if (i % 3 == 0)
+                    wrong += wccp_set_L2_return(static_cast<uint8_t>(i), caller);
+                else if (give(id, address(id * 3u), address(id * 5u), &index) != 0 || index != 1000u + id)
+                    wrong++;
+            }
+        });
+    }
+    for (std::thread &caller : callers)
+        caller.join();
+    EXPECT_EQ(torn, 0);
+    EXPECT_EQ(wrong, 0);
+}
+
+// A writer that gives up and replaces its command all the time, as wccpd does after two seconds.
+TEST_F(Mailbox, AReplacedCommandIsNeverReadHalf) {
+    std::atomic<bool> stop = false;
+    std::thread writer([&] {
+        for (uint32_t i = 1; !stop; i++) {
+            const uint32_t value = i % 60000;
+            wccp_mailbox->command.store(0, std::memory_order_release);
+            __atomic_store_n(&wccp_mailbox->tunnel_id, static_cast<uint16_t>(value), __ATOMIC_RELEASE);
+            __atomic_store_n(&wccp_mailbox->local_ip, value, __ATOMIC_RELEASE);
+            __atomic_store_n(&wccp_mailbox->remote_ip, value, __ATOMIC_RELEASE);
+            __atomic_store_n(&wccp_mailbox->fmst_index, value, __ATOMIC_RELEASE);
+            wccp_mailbox->command.store(static_cast<uint16_t>(1 + i % 2), std::memory_order_release);
+            // Several in the time of one read, then long enough for one.
+            const auto next = std::chrono::steady_clock::now() + (i % 8 ? 0us : 40us);
+            while (std::chrono::steady_clock::now() < next)
+                ;
+        }
+    });
+    int whole = 0, torn = 0;
+    const auto end = std::chrono::steady_clock::now() + 500ms;
+    while (std::chrono::steady_clock::now() < end) {
+        const uint16_t code = wccp_get_tunnel_command();
+        if (code == 0)
+            continue;
+        uint16_t id = 0;
+        mailbox_address local = {}, remote = {};
+        uint32_t index = 0;
+        wccp_get_tunnel_parameters(&id, &local, &remote, &index);
+        if (wccp_get_tunnel_command() != code)
+            continue;
+        whole++;
+        if (local.words[0] != id || remote.words[0] != id || index != id)
+            torn++;
+    }
+    stop = true;
+    writer.join();
+    EXPECT_GT(whole, 100);
+    EXPECT_EQ(torn, 0);
+}
+
+TEST_F(Mailbox, AResetEndsAWaitWithoutAnAnswer) {
+    for (int round = 0; round < 10; round++) {
+        fake_tunneld tunneld(tunneld_is_silent);
+        int results[2] = {-1, -1};
+        uint32_t indices[2] = {42, 42};
+        const double took = seconds_of([&] {
+            std::thread add(
+                [&] { results[0] = wccp_add_tunnel_encap(9, address(1), address(2), &indices[0]); });
+            tunneld.wait_for_command();
+            std::thread behind(
+                [&] { results[1] = wccp_del_tunnel_encap(9, address(1), address(2), &indices[1]); });
+            wccp_cleanup_shmem();
+            add.join();
+            tunneld.answer_with(tunneld_does);
+            behind.join();
+        });
+        EXPECT_EQ(results[0], 1);
+        EXPECT_EQ(indices[0], 42u);
+        EXPECT_LT(took, 1.5);
+        uint32_t index = 3;
+        EXPECT_EQ(wccp_del_tunnel_encap(9, address(1), address(2), &index), 0) << "commands work after it";
+        EXPECT_EQ(index, 1009u);
+    }
+}
+
+TEST_F(Mailbox, ACancelledWaiterLeavesTheMailboxUsable) {
+    for (const uint16_t code : {MAILBOX_ADD_TUNNEL, MAILBOX_DELETE_TUNNEL, MAILBOX_L2_RETURN}) {
+        fake_tunneld tunneld(tunneld_is_silent);
+        pthread_t waiter;
+        uint16_t given = code;
+        ASSERT_EQ(pthread_create(
+                      &waiter, nullptr,
+                      [](void *argument) -> void * {
+                          const uint16_t which = *static_cast<uint16_t *>(argument);
+                          uint32_t index = 1;
+                          if (which == MAILBOX_L2_RETURN)
+                              wccp_set_L2_return(1, 1);
+                          else
+                              (which == MAILBOX_ADD_TUNNEL ? wccp_add_tunnel_encap : wccp_del_tunnel_encap)(
+                                  1, address(1), address(2), &index);
+                          return nullptr;
+                      },
+                      &given),
+                  0);
+        tunneld.wait_for_command();
+        void *result = nullptr;
+        const double took = seconds_of([&] {
+            pthread_cancel(waiter);
+            pthread_join(waiter, &result);
+        });
+        EXPECT_EQ(result, PTHREAD_CANCELED);
+        EXPECT_LT(took, 1);
+        EXPECT_EQ(wccp_get_tunnel_command(), code == MAILBOX_ADD_TUNNEL ? 0 : code);
+        tunneld.answer_with(tunneld_does);
+        uint32_t index = 0;
+        EXPECT_EQ(wccp_add_tunnel_encap(2, address(1), address(2), &index), 0);
+    }
+}
+
+TEST_F(Mailbox, APolicyGroupIsActiveOnlyWhenAllItsMembersAre) {
+    const uint8_t members[] = {0, 9, 255};
+    const auto role = [] { return wccp_get_role(300); };
+    wccp_add_policy_grp(300, 0, nullptr);
+    EXPECT_EQ(role(), 2u) << "no member";
+    for (const uint8_t id : members)
+        wccp_set_role(id, 0);
+    wccp_add_policy_grp(300, 3, members);
+    EXPECT_EQ(role(), 0u);
+    wccp_set_role(255, 2);
+    EXPECT_EQ(role(), 1u) << "an unknown member counts like a backup";
+    wccp_set_role(255, 0);
+    EXPECT_EQ(role(), 0u);
+    wccp_set_role(0, 1);
+    EXPECT_EQ(role(), 1u);
+    wccp_remove_policy_grp(300, 0);
+    EXPECT_EQ(role(), 0u);
+    EXPECT_EQ(wccp_check_policy_group(300, 0), 0);
+    EXPECT_EQ(wccp_check_policy_group(300, 9), 1);
+    wccp_set_role(0, 1);
+    EXPECT_EQ(role(), 0u) << "no member any more";
+    wccp_remove_policy_grp(300, 9);
+    wccp_remove_policy_grp(300, 255);
+    EXPECT_EQ(role(), 2u);
+}
+
+TEST_F(Mailbox, AServiceGroupFollowsItsLastPolicyGroup) {
+    const uint8_t id = 51;
+    wccp_set_role(id, 0);
+    wccp_add_policy_grp(1, 1, &id);
+    wccp_add_policy_grp(65535, 1, &id);
+    EXPECT_EQ(wccp_check_policy_group(1, id), 1) << "the bit stays";
+    EXPECT_EQ(wccp_check_policy_group(65535, id), 1);
+    wccp_set_role(id, 1);
+    EXPECT_EQ(wccp_get_role(1), 0u);
+    EXPECT_EQ(wccp_get_role(65535), 1u);
+    wccp_del_entire_policy_grp(1);
+    EXPECT_EQ(wccp_get_role(1), 2u);
+    wccp_set_role(id, 0);
+    EXPECT_EQ(wccp_get_role(65535), 1u) << "the delete took its policy group from it";
+    // Policy group 0 can have members, and doesn't follow them.
+    wccp_add_policy_grp(0, 1, &id);
+    EXPECT_EQ(wccp_get_role(0), 0u);
+    wccp_set_role(id, 1);
+    EXPECT_EQ(wccp_get_role(0), 0u);
+}
+
+TEST_F(Mailbox, AnyNumberOfPolicyGroupsKeepsItsMembers) {
+    for (uint32_t policy = 0; policy < WCCP_POLICY_GROUPS; policy += 17) {
+        const auto id = static_cast<uint8_t>(policy % 251);
+        ASSERT_EQ(wccp_add_policy_grp(static_cast<uint16_t>(policy), 1, &id), 0);
+    }
+    for (uint32_t policy = 0; policy < WCCP_POLICY_GROUPS; policy += 34)
+        wccp_del_entire_policy_grp(static_cast<uint16_t>(policy));
+    for (uint32_t policy = 0; policy < WCCP_POLICY_GROUPS; policy += 17)
+        for (const uint32_t id : {policy % 251, (policy + 1) % 251})
+            ASSERT_EQ(wccp_check_policy_group(static_cast<uint16_t>(policy), static_cast<uint8_t>(id)),
+                      policy % 34 != 0 && id == policy % 251)
+                << policy;
+}
+
+// Membership changes on the management thread while the engine's threads change roles.
+TEST_F(Mailbox, MembersAndRolesChangeAtOnce) {
+    std::atomic<bool> stop = false;
+    std::thread engine([&] {
+        for (uint32_t i = 0; !stop; i++)
+            wccp_set_role(static_cast<uint8_t>(i), i % 3);
+    });
+    const auto end = std::chrono::steady_clock::now() + 300ms;
+    for (uint32_t i = 0; std::chrono::steady_clock::now() < end; i++) {
+        const auto policy = static_cast<uint16_t>(1 + i % 40);
+        const uint8_t ids[] = {static_cast<uint8_t>(i), static_cast<uint8_t>(i * 7)};
+        wccp_add_policy_grp(policy, 2, ids);
+        wccp_remove_policy_grp(policy, ids[1]);
+        if (i % 5 == 0)
+            wccp_del_entire_policy_grp(policy);
+    }
+    stop = true;
+    engine.join();
+    for (uint32_t id = 0; id < 256; id++)
+        wccp_set_role(static_cast<uint8_t>(id), 0);
+    for (uint16_t policy = 1; policy <= 40; policy++) {
+        bool any = false;
+        for (uint32_t id = 0; id < 256; id++)
+            any = any || wccp_check_policy_group(policy, static_cast<uint8_t>(id));
+        wccp_add_policy_grp(policy, 0, nullptr);
+        EXPECT_EQ(wccp_get_role(policy), any ? 0u : 2u) << policy;
+    }
+}
