@@ -1,0 +1,110 @@
+// Sending routers behind GRE tunnels, with tunneld on the other side of the mailbox: one tunnel for each
+// router, and nothing lost when the thread that waits for tunneld is cancelled.
+#include <pthread.h>
+
+#include <memory>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "engine/wccp_router_utils.h"
+#include "engine/wccp_tunnel.h"
+#include "engine/wccp_utils.h"
+#include "engine/wccpd_common.h"
+#include "tests/support/fake_tunneld.h"
+#include "tests/support/reported_group.h"
+
+namespace {
+
+const wccp_rtr_capabilities GRE = {1, 1, 1};
+
+struct TunnelledRouters : testing::Test {
+    static void SetUpTestSuite() {
+        write_mem_conf();
+        ASSERT_EQ(wccp_init_shmem(), 0);
+    }
+    ~TunnelledRouters() override {
+        wccp_del_all_tunnels();
+        shared.reset();
+        EXPECT_EQ(wccp_g.stat_allocs.load(), wccp_g.stat_frees.load());
+    }
+    // Runs `work` under the engine lock on a thread that is cancelled as soon as it waits for tunneld.
+    void cancel_in_the_wait(void (*work)(wccp_service_group *group)) {
+        struct job {
+            void (*work)(wccp_service_group *group);
+            wccp_service_group *group;
+        } job = {work, shared->group};
+        pthread_t thread;
+        ASSERT_EQ(pthread_create(
+                      &thread, nullptr,
+                      [](void *argument) -> void * {
+                          const auto *what = static_cast<struct job *>(argument);
+                          const wccp_engine_lock lock;
+                          what->work(what->group);
+                          return nullptr;
+                      },
+                      &job),
+                  0);
+        tunneld.wait_for_command();
+        pthread_cancel(thread);
+        void *result = nullptr;
+        pthread_join(thread, &result);
+        ASSERT_EQ(result, PTHREAD_CANCELED);
+        ASSERT_EQ(pthread_mutex_trylock(&wccp_g.lock), 0) << "a lock that nobody holds any more";
+        pthread_mutex_unlock(&wccp_g.lock);
+        tunneld.answer_with(tunneld_does);
+    }
+    std::vector<uint16_t> codes() {
+        std::vector<uint16_t> found;
+        for (const seen_command &command : tunneld.take_commands())
+            found.push_back(command.code);
+        return found;
+    }
+    fake_tunneld tunneld{tunneld_does};
+    std::unique_ptr<reported_group> shared = std::make_unique<reported_group>(false);
+    wccp_service_group *group = shared->group;
+};
+
+TEST_F(TunnelledRouters, GetATunnelEachAndGiveItBack) {
+    const wccp_rtr_capabilities gre_return = {2, 1, 1};
+    ASSERT_NE(wccp_create_sending_router(group, ROUTER_A, &GRE, &GRE), nullptr);
+    wccp_sending_router *b = wccp_create_sending_router(group, ROUTER_B, &gre_return, &gre_return);
+    ASSERT_NE(b, nullptr);
+    EXPECT_EQ(b->flags, WCCP_RTR_ONE_WAY | WCCP_RTR_HAS_TUNNEL);
+    EXPECT_EQ(codes(), (std::vector<uint16_t>{MAILBOX_ADD_TUNNEL, MAILBOX_ADD_TUNNEL}));
+    tunneld.answer_with([](const seen_command &) { return tunneld_answer{1, 5}; });
+    EXPECT_EQ(wccp_create_sending_router(group, ROUTER_C, &GRE, &GRE), nullptr);
+    EXPECT_EQ(group->sending_router_count, 2u);
+    tunneld.answer_with(tunneld_does);
+    codes();
+    wccp_g.seconds += 40;
+    wccp_monitor_sending_routers(group);
+    EXPECT_EQ(group->sending_router_count, 0u);
+    EXPECT_EQ(codes(), (std::vector<uint16_t>{MAILBOX_DELETE_TUNNEL, MAILBOX_DELETE_TUNNEL}));
+}
+
+TEST_F(TunnelledRouters, ARouterInTheMakingGoesWithItsThread) {
+    tunneld.answer_with(tunneld_is_silent);
+    cancel_in_the_wait(
+        [](wccp_service_group *waiting) { wccp_create_sending_router(waiting, ROUTER_A, &GRE, &GRE); });
+    EXPECT_EQ(group->sending_router_count, 0u);
+    EXPECT_EQ(group->sending_routers, nullptr);
+    EXPECT_FALSE(group->state_flags & WCCP_CAPABILITIES_SET);
+    ASSERT_NE(wccp_create_sending_router(group, ROUTER_A, &GRE, &GRE), nullptr);
+    wccp_g.seconds += 40;
+    wccp_monitor_sending_routers(group);
+}
+
+TEST_F(TunnelledRouters, ARouterOnItsWayOutGoesWithItsThread) {
+    ASSERT_NE(wccp_create_sending_router(group, ROUTER_A, &GRE, &GRE), nullptr);
+    shared->see(ROUTER_A, {ROUTER_A}, {{US, 100}});
+    wccp_g.seconds += 40;
+    tunneld.answer_with(tunneld_is_silent);
+    cancel_in_the_wait([](wccp_service_group *waiting) { wccp_monitor_sending_routers(waiting); });
+    EXPECT_EQ(group->sending_router_count, 0u);
+    EXPECT_EQ(group->sending_routers, nullptr);
+    EXPECT_EQ(group->appliance_view, nullptr);
+    EXPECT_EQ(group->router_view, nullptr);
+}
+
+} // namespace
