@@ -1,0 +1,582 @@
+// One loop over libevent, with what the daemon relies on beyond it.
+//
+// Nesting. libevent refuses to be run from a callback of its own. So here it only finds out what is ready or
+// due: its callbacks put the event on a list and do nothing else. When event_base_loop has returned, the
+// found events go to the end of one queue, and loop_run calls them from there. A callback may call loop_run
+// again: the inner rounds find more, and run the same queue, the outer round's leftovers first. An event that
+// is removed or freed leaves the queue as well, so nothing runs that an earlier callback has taken away, at
+// whatever depth. Nothing of an event is touched once its function has been called. What waits in the queue
+// makes the next look at the descriptors one without waiting.
+//
+// Threads. libevent is only ever called by the thread that owns the loop. Another thread that wants a change
+// posts it: the post lies in a list under a mutex that is never held while anything else is taken, and the
+// owner carries it out before it runs its next callback. The poster waits for nothing, so it may hold any
+// lock. A poster that finds the list empty wakes the owner through the self-pipe. Work that was posted counts
+// as something that ran, so that a wait for one round sees what it changed.
+//
+// The lock is recursive and held during all callbacks; the wait releases it whole, however deep, and takes it
+// again to the same depth. A nested wait so takes it while it holds the locks of its session. That is sound
+// only because no other thread asks for anything while it holds this lock: signal registrations and the
+// escape are all that others do with it. It is a mutex with a condition and not an lc_lock, since it has to
+// be let go of whole.
+//
+// Signals are blocked in the owner's thread but for the wait. The handler writes a message of 128 bytes to
+// the self-pipe; the owner reads it and puts the signal's events on the queue. Each signal belongs to one
+// context. A signal whose last registration goes gets its earlier disposition back but stays blocked in this
+// thread, so that a second SIGTERM does not kill the process in the middle of its orderly exit.
+//
+// The escape flag is never cleared. Each round looks at it first, and again after each callback.
+//
+// poll is the mechanism, not epoll: a descriptor that was closed under its event then shows as readable and
+// writable, in the place of vanishing without a sign.
+#include "daemon/libevent_loop.h"
+
+#include <atomic>
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+
+#include <event2/event.h>
+#include <event2/event_struct.h>
+#include <fcntl.h>
+#include <pthread.h>
+#include <unistd.h>
+
+#include "daemon/libevent_wrapper.h"
+#include "runtime/guards.h"
+#include "runtime/logging.h"
+
+static_assert(LOOP_TIMEOUT == EV_TIMEOUT && LOOP_READ == EV_READ && LOOP_WRITE == EV_WRITE &&
+              LOOP_SIGNAL == EV_SIGNAL);
+
+constexpr uint32_t MESSAGE_BYTES = 128;
+constexpr time_t WAIT_MAX_SECONDS = 5;
+constexpr uint32_t FDS_MAX = 100000;
+constexpr int64_t TIME_MAX_SECONDS = 0x7ffffffe;
+
+enum class event_kind : uint8_t { unset, descriptor, timer, signal };
+
+struct loop_event {
+    loop_context *context;
+    loop_function function;
+    void *data;
+    event base_event;
+    event_kind kind;
+    bool inserted;
+    int number; // descriptor or signal
+    short found;
+    loop_event *next_found;
+    short noted;
+    loop_event *next_noted, *previous_noted;
+    loop_event *next_signal;
+};
+
+struct loop_lock {
+    pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
+    pthread_cond_t freed = PTHREAD_COND_INITIALIZER;
+    pthread_t holder{};
+    uint32_t count = 0;
+};
+
+struct loop_context {
+    event_base *base;
+    pthread_t owner;
+    loop_lock lock;
+    std::atomic<int32_t> escape;
+    int pipe_read, pipe_write;
+    event *pipe_event, *limit_event;
+    bool pipe_readable;
+    uint32_t inserted, descriptors, timers;
+    loop_event *found_first, *found_last;
+    loop_event *noted_first, *noted_last;
+    loop_event *signals;
+    sigset_t owned_signals;
+    pthread_mutex_t posts_mutex;
+    loop_post *posts_first, *posts_last;
+};
+
+// ---- The lock
+
+static void lock_take(loop_lock *lock, uint32_t count) {
+    const mutex_guard guard(&lock->mutex);
+    const pthread_t self = pthread_self();
+    while (lock->count && !pthread_equal(lock->holder, self))
+        pthread_cond_wait(&lock->freed, &lock->mutex);
+    lock->holder = self;
+    lock->count += count;
+}
+static void lock_give(loop_lock *lock, uint32_t count) {
+    const mutex_guard guard(&lock->mutex);
+    lock->count -= count;
+    if (!lock->count)
+        pthread_cond_signal(&lock->freed);
+}
+void loop_lock_take(loop_context *context) {
+    lock_take(&context->lock, 1);
+}
+void loop_lock_give(loop_context *context) {
+    lock_give(&context->lock, 1);
+}
+
+int loop_is_own_thread(const loop_context *context) {
+    return pthread_equal(context->owner, pthread_self());
+}
+
+// ---- The queue
+
+static void note(loop_event *event, short flags) {
+    loop_context *context = event->context;
+    const bool queued = event->noted != 0;
+    event->noted = static_cast<short>(event->noted | flags);
+    if (queued)
+        return;
+    event->next_noted = nullptr;
+    event->previous_noted = context->noted_last;
+    (context->noted_last ? context->noted_last->next_noted : context->noted_first) = event;
+    context->noted_last = event;
+}
+
+static short take_note(loop_event *event) {
+    loop_context *context = event->context;
+    const short flags = event->noted;
+    if (!flags)
+        return 0;
+    event->noted = 0;
+    (event->previous_noted ? event->previous_noted->next_noted : context->noted_first) = event->next_noted;
+    (event->next_noted ? event->next_noted->previous_noted : context->noted_last) = event->previous_noted;
+    return flags;
+}
+
+// What libevent calls: inside the wait, without the lock, on the owner's thread.
+static void found(evutil_socket_t, short flags, void *data) {
+    loop_event *event = static_cast<loop_event *>(data);
+    loop_context *context = event->context;
+    const bool listed = event->found != 0;
+    event->found = static_cast<short>(event->found | (flags & (EV_TIMEOUT | EV_READ | EV_WRITE)));
+    if (listed || !event->found)
+        return;
+    event->next_found = nullptr;
+    (context->found_last ? context->found_last->next_found : context->found_first) = event;
+    context->found_last = event;
+}
+static void pipe_found(evutil_socket_t, short, void *data) {
+    static_cast<loop_context *>(data)->pipe_readable = true;
+}
+static void limit_found(evutil_socket_t, short, void *) {}
+
+static void note_found(loop_context *context) {
+    while (loop_event *event = context->found_first) {
+        context->found_first = event->next_found;
+        const short flags = event->found;
+        event->found = 0;
+        note(event, flags);
+    }
+    context->found_last = nullptr;
+}
+
+// ---- Events
+
+static void count_event(loop_event *event, bool in) {
+    loop_context *context = event->context;
+    const uint32_t step = in ? 1u : ~0u;
+    event->inserted = in;
+    context->inserted += step;
+    if (event->kind == event_kind::descriptor)
+        context->descriptors += step;
+    if (event->kind == event_kind::timer)
+        context->timers += step;
+}
+
+lc_status loop_event_new(loop_context *context, loop_function function, void *data, loop_event **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(context);
+    auto *event = static_cast<loop_event *>(calloc(1, sizeof(loop_event)));
+    CHECK_NULL(event);
+    event->context = context;
+    event->function = function;
+    event->data = data;
+    *out = event;
+    return LC_OK;
+}
+
+static lc_status insert(loop_event *event, const timeval *delay) {
+    if (event_add(&event->base_event, delay) != 0)
+        FAIL_WITH(LC_GENERIC);
+    count_event(event, true);
+    return LC_OK;
+}
+
+lc_status loop_event_set_fd(loop_event *event, int fd, short flags) {
+    CHECK_NULL(event);
+    CHECK_CONDITION(fd >= 0 && !(flags & ~(LOOP_READ | LOOP_WRITE)));
+    const loop_guard guard(event->context);
+    loop_event_remove(event);
+    event->kind = event_kind::descriptor;
+    event->number = fd;
+    if (event_assign(&event->base_event, event->context->base, fd, static_cast<short>(flags | EV_PERSIST),
+                     found, event) != 0)
+        FAIL_WITH(LC_GENERIC);
+    if (!flags) { // registered, and waits for nothing
+        count_event(event, true);
+        return LC_OK;
+    }
+    CHECK_STATUS(insert(event, nullptr));
+    return LC_OK;
+}
+
+lc_status loop_event_set_timer(loop_event *event, int64_t delay_ms) {
+    CHECK_NULL(event);
+    CHECK_CONDITION(delay_ms >= 0);
+    const loop_guard guard(event->context);
+    loop_event_remove(event);
+    event->kind = event_kind::timer;
+    event->number = -1;
+    if (event_assign(&event->base_event, event->context->base, -1, 0, found, event) != 0)
+        FAIL_WITH(LC_GENERIC);
+    timespec now{};
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    timeval delay;
+    delay.tv_sec = delay_ms / 1000;
+    delay.tv_usec = delay_ms % 1000 * 1000;
+    if (delay.tv_sec > TIME_MAX_SECONDS - now.tv_sec - 1)
+        delay.tv_sec = TIME_MAX_SECONDS - now.tv_sec - 1;
+    CHECK_STATUS(insert(event, &delay));
+    return LC_OK;
+}
+
+// ---- Signals
+
+static std::atomic<loop_context *> le_signal_contexts[LEW_SIGNAL_MAX + 1];
+static struct sigaction earlier_actions[LEW_SIGNAL_MAX + 1];
+static pthread_mutex_t signal_table_mutex = PTHREAD_MUTEX_INITIALIZER;
+
+loop_context *le_signal_context(int signal_number) {
+    return le_signal_contexts[signal_number].load();
+}
+
+static void handle_signal(int number, siginfo_t *, void *) {
+    const int saved = errno;
+    const loop_context *context = le_signal_contexts[number].load();
+    if (context) {
+        char message[MESSAGE_BYTES] = {};
+        memcpy(message, &number, sizeof number);
+        // A full pipe loses the message; the handler runs in the wait only, which empties the pipe each time.
+        (void)!write(context->pipe_write, message, sizeof message);
+    }
+    errno = saved;
+}
+
+static lc_status own_signal(loop_context *context, int number) {
+    const mutex_guard guard(&signal_table_mutex);
+    const loop_context *owner = le_signal_contexts[number].load();
+    if (owner == context)
+        return LC_OK;
+    if (owner) {
+        LC_LOG(LC_LOG_ERR, "Signal %d has already been registered from a different libevent context", number);
+        return LC_ASSERTION;
+    }
+    struct sigaction action;
+    memset(&action, 0, sizeof action);
+    action.sa_sigaction = handle_signal;
+    action.sa_flags = SA_RESTART | SA_SIGINFO;
+    sigfillset(&action.sa_mask);
+    sigset_t set;
+    sigemptyset(&set);
+    sigaddset(&set, number);
+    pthread_sigmask(SIG_BLOCK, &set, nullptr);
+    le_signal_contexts[number] = context;
+    if (sigaction(number, &action, &earlier_actions[number]) != 0) {
+        le_signal_contexts[number] = nullptr;
+        FAIL_WITH(LC_GENERIC);
+    }
+    sigaddset(&context->owned_signals, number);
+    return LC_OK;
+}
+
+static void disown_signal(loop_context *context, int number) {
+    const mutex_guard guard(&signal_table_mutex);
+    sigaction(number, &earlier_actions[number], nullptr);
+    le_signal_contexts[number] = nullptr;
+    sigdelset(&context->owned_signals, number);
+}
+
+lc_status loop_event_set_signal(loop_event *event, int number) {
+    CHECK_NULL(event);
+    CHECK_CONDITION(number >= 1 && number <= LEW_SIGNAL_MAX);
+    loop_context *context = event->context;
+    const loop_guard guard(context);
+    loop_event_remove(event);
+    CHECK_STATUS(own_signal(context, number));
+    event->kind = event_kind::signal;
+    event->number = number;
+    event->next_signal = context->signals;
+    context->signals = event;
+    count_event(event, true);
+    return LC_OK;
+}
+
+static void remove_signal(loop_event *event) {
+    loop_context *context = event->context;
+    bool others = false;
+    for (loop_event **link = &context->signals; *link;) {
+        loop_event *each = *link;
+        if (each == event) {
+            *link = each->next_signal;
+            continue;
+        }
+        others |= each->number == event->number;
+        link = &each->next_signal;
+    }
+    if (!others)
+        disown_signal(context, event->number);
+}
+
+void loop_event_remove(loop_event *event) {
+    const loop_guard guard(event->context);
+    take_note(event);
+    if (!event->inserted)
+        return;
+    count_event(event, false);
+    if (event->kind == event_kind::signal)
+        remove_signal(event);
+    else
+        event_del(&event->base_event);
+}
+
+void loop_event_free(loop_event **inout) {
+    loop_event *event = *inout;
+    *inout = nullptr;
+    if (!event)
+        return;
+    loop_event_remove(event);
+    free(event);
+}
+
+// Each message of the self-pipe: a signal, or number 0 for a mere wake-up.
+static void read_pipe(loop_context *context) {
+    char message[MESSAGE_BYTES];
+    while (read(context->pipe_read, message, sizeof message) == static_cast<ssize_t>(sizeof message)) {
+        int number = 0;
+        memcpy(&number, message, sizeof number);
+        for (loop_event *event = context->signals; number && event; event = event->next_signal)
+            if (event->number == number)
+                note(event, LOOP_SIGNAL);
+    }
+}
+
+static lc_status wake(loop_context *context) {
+    const char message[MESSAGE_BYTES] = {};
+    ssize_t written;
+    do
+        written = write(context->pipe_write, message, sizeof message);
+    while (written < 0 && errno == EINTR);
+    if (written < 0 && errno == EAGAIN)
+        return LC_OK; // a full pipe wakes as well
+    CHECK_CONDITION(written == static_cast<ssize_t>(sizeof message));
+    return LC_OK;
+}
+
+// ---- Work of other threads
+
+void loop_post_work(loop_context *context, loop_post *post) {
+    const cancel_off_guard cancel_off;
+    post->next = nullptr;
+    bool first;
+    {
+        const mutex_guard guard(&context->posts_mutex);
+        first = context->posts_first == nullptr;
+        (context->posts_last ? context->posts_last->next : context->posts_first) = post;
+        context->posts_last = post;
+    }
+    if (first)
+        LOG_STATUS(wake(context));
+}
+
+static loop_post *take_post(loop_context *context) {
+    const mutex_guard guard(&context->posts_mutex);
+    loop_post *post = context->posts_first;
+    if (post) {
+        context->posts_first = post->next;
+        if (!post->next)
+            context->posts_last = nullptr;
+    }
+    return post;
+}
+
+static bool run_posts(loop_context *context) {
+    bool ran = false;
+    while (loop_post *post = take_post(context)) {
+        post->function(post, 1);
+        ran = true;
+    }
+    return ran;
+}
+
+void loop_run_posted(loop_context *context) {
+    const loop_guard guard(context);
+    (void)run_posts(context);
+}
+
+void loop_withdraw_posted(loop_context *context, const void *poster) {
+    loop_post *withdrawn = nullptr;
+    {
+        const mutex_guard guard(&context->posts_mutex);
+        loop_post *kept_last = nullptr;
+        for (loop_post **link = &context->posts_first; *link;) {
+            loop_post *post = *link;
+            if (post->poster == poster) {
+                *link = post->next;
+                post->next = withdrawn;
+                withdrawn = post;
+            } else {
+                kept_last = post;
+                link = &post->next;
+            }
+        }
+        context->posts_last = kept_last;
+    }
+    while (loop_post *post = withdrawn) {
+        withdrawn = post->next;
+        post->function(post, 0);
+    }
+}
+
+// ---- Rounds
+
+static lc_status wait_round(loop_context *context) {
+    const bool without_waiting = context->noted_first != nullptr;
+    if (context->descriptors > FDS_MAX) {
+        LC_LOG(LC_LOG_ERR, "too many fds");
+        return LC_GENERIC;
+    }
+    const timeval limit = {WAIT_MAX_SECONDS, 0};
+    if (!without_waiting && !context->timers && event_add(context->limit_event, &limit) != 0)
+        FAIL_WITH(LC_GENERIC);
+    const sigset_t signals = context->owned_signals;
+    const uint32_t held = context->lock.count;
+    lock_give(&context->lock, held);
+    pthread_sigmask(SIG_UNBLOCK, &signals, nullptr);
+    const int result = event_base_loop(context->base, EVLOOP_ONCE | (without_waiting ? EVLOOP_NONBLOCK : 0));
+    pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+    lock_take(&context->lock, held);
+    event_del(context->limit_event);
+    if (context->pipe_readable) {
+        context->pipe_readable = false;
+        read_pipe(context);
+    }
+    note_found(context);
+    if (result < 0)
+        FAIL_WITH(LC_GENERIC);
+    return LC_OK;
+}
+
+static bool run_noted(loop_context *context) {
+    bool ran = run_posts(context);
+    while (loop_event *event = context->noted_first) {
+        if (context->escape)
+            break;
+        const short flags = take_note(event);
+        if (event->kind == event_kind::timer)
+            count_event(event, false);
+        event->function(event->number, flags, event->data); // the event may be gone from here on
+        run_posts(context);
+        ran = true;
+    }
+    return ran;
+}
+
+lc_status loop_run(loop_context *context, bool once, int *out_no_events, int *out_escaped) {
+    CHECK_CONDITION(loop_is_own_thread(context));
+    const loop_guard guard(context);
+    bool ran = run_posts(context);
+    for (;;) {
+        if (context->escape) {
+            *out_escaped = 1;
+            return LC_OK;
+        }
+        if (once && ran)
+            return LC_OK;
+        if (!context->inserted && !context->noted_first) {
+            *out_no_events = 1;
+            return LC_OK;
+        }
+        CHECK_STATUS(wait_round(context));
+        ran = run_noted(context);
+    }
+}
+
+lc_status loop_escape(loop_context *context) {
+    {
+        const loop_guard guard(context);
+        context->escape = 1;
+    }
+    if (!loop_is_own_thread(context))
+        CHECK_STATUS(wake(context));
+    return LC_OK;
+}
+
+// ---- Making and freeing
+
+[[noreturn]] static void end_process(const char *function, const char *what) {
+    fprintf(stderr, "%s: %s\n", function, what);
+    exit(1);
+}
+
+static event_base *new_base() {
+    event_config *config = event_config_new();
+    if (!config)
+        return nullptr;
+    event_config_avoid_method(config, "epoll");
+    event_config_avoid_method(config, "select");
+    event_config_set_flag(config, EVENT_BASE_FLAG_IGNORE_ENV);
+    event_base *base = event_base_new_with_config(config);
+    event_config_free(config);
+    return base;
+}
+
+loop_context *loop_new() {
+    auto *context = static_cast<loop_context *>(calloc(1, sizeof(loop_context)));
+    if (!context)
+        end_process(__func__, "couldn't allocate event context");
+    context->owner = pthread_self();
+    context->lock = loop_lock();
+    pthread_mutex_init(&context->posts_mutex, nullptr);
+    sigemptyset(&context->owned_signals);
+    int ends[2];
+    if (pipe2(ends, O_CLOEXEC | O_NONBLOCK) != 0) {
+        LC_LOG(LC_LOG_ERR, "pipe system call failed");
+        free(context);
+        return nullptr;
+    }
+    context->pipe_read = ends[0];
+    context->pipe_write = ends[1];
+    context->base = new_base();
+    if (!context->base)
+        end_process(__func__, "no event mechanism available");
+    context->pipe_event =
+        event_new(context->base, context->pipe_read, EV_READ | EV_PERSIST, pipe_found, context);
+    context->limit_event = event_new(context->base, -1, 0, limit_found, nullptr);
+    if (!context->pipe_event || !context->limit_event || event_add(context->pipe_event, nullptr) != 0)
+        end_process(__func__, "couldn't allocate event context");
+    return context;
+}
+
+void loop_free(loop_context **inout) {
+    loop_context *context = *inout;
+    *inout = nullptr;
+    if (!context)
+        return;
+    while (loop_post *post = take_post(context))
+        post->function(post, 0);
+    event_free(context->limit_event);
+    event_free(context->pipe_event);
+    event_base_free(context->base);
+    close(context->pipe_read);
+    close(context->pipe_write);
+    pthread_mutex_destroy(&context->posts_mutex);
+    free(context);
+}

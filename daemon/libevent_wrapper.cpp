@@ -1,0 +1,211 @@
+// `lew`: what the daemon calls. A context holds the loop (libevent_loop.cpp) and the registrations that its
+// callers made, as the sorted array of the addresses of their slots: taking one out frees the event and
+// clears the slot, so a slot reads null again after lew_event_delete or lew_deinit, whoever asked for it.
+//
+// Registrations are made, cancelled and deleted under the loop's lock, by any thread while the loop waits;
+// dispatch is the owner's alone. A registration may be deleted from inside its own callback, as the exit does
+// with all six.
+#include "daemon/libevent_wrapper.h"
+
+#include <cstdlib>
+#include <cstring>
+
+#include "daemon/libevent_loop.h"
+#include "runtime/logging.h"
+
+struct lew_event {
+    loop_event *registered;
+    lew *context;
+    lew_callback callback;
+    void *data;
+};
+
+struct lew {
+    loop_context *loop;
+    lew_event ***slots; // sorted by address, each once
+    uint32_t count, capacity;
+};
+
+lc_status lew_init(lew **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    auto *context = static_cast<lew *>(calloc(1, sizeof(lew)));
+    CHECK_NULL(context);
+    context->loop = loop_new();
+    if (!context->loop) {
+        free(context);
+        FAIL_WITH(LC_GENERIC);
+    }
+    *out = context;
+    return LC_OK;
+}
+
+lc_status lew_get_event_context(lew *context, loop_context **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(context);
+    *out = context->loop;
+    return LC_OK;
+}
+
+// The place of a slot, or where it would stand.
+static uint32_t place_of(const lew *context, lew_event **slot, bool *out_found) {
+    uint32_t place = 0;
+    while (place < context->count && context->slots[place] < slot)
+        place++;
+    *out_found = place < context->count && context->slots[place] == slot;
+    return place;
+}
+
+static lc_status find_slot(const lew *context, lew_event **slot, uint32_t *out_place) {
+    bool found;
+    *out_place = place_of(context, slot, &found);
+    return found ? LC_OK : LC_NOT_FOUND;
+}
+
+static lc_status add_slot(lew *context, lew_event **slot) {
+    bool found;
+    const uint32_t place = place_of(context, slot, &found);
+    if (found)
+        return LC_EXISTS;
+    if (context->count == context->capacity) {
+        const uint32_t capacity = context->capacity + 10;
+        void *grown = realloc(context->slots, capacity * sizeof *context->slots);
+        CHECK_NULL(grown);
+        context->slots = static_cast<lew_event ***>(grown);
+        context->capacity = capacity;
+    }
+    memmove(context->slots + place + 1, context->slots + place,
+            (context->count - place) * sizeof *context->slots);
+    context->slots[place] = slot;
+    context->count++;
+    return LC_OK;
+}
+
+static void delete_slot(lew *context, uint32_t place) {
+    lew_event **slot = context->slots[place];
+    context->count--;
+    memmove(context->slots + place, context->slots + place + 1,
+            (context->count - place) * sizeof *context->slots);
+    lew_event *event = *slot;
+    *slot = nullptr;
+    if (event)
+        loop_event_free(&event->registered);
+    free(event);
+}
+
+static void lew_universal_event_handler(int number, short flags, void *data) {
+    const lew_event event = *static_cast<lew_event *>(data); // its callback may delete it
+    LOG_STATUS(event.callback(number, flags, event.data, event.context));
+}
+
+static lc_status make_event(lew *context, lew_event **slot) {
+    auto *event = static_cast<lew_event *>(calloc(1, sizeof(lew_event)));
+    CHECK_NULL(event);
+    event->context = context;
+    lc_status status = loop_event_new(context->loop, lew_universal_event_handler, event, &event->registered);
+    if (status == LC_OK)
+        status = add_slot(context, slot);
+    if (status != LC_OK) {
+        loop_event_free(&event->registered);
+        free(event);
+        FAIL_WITH(status);
+    }
+    *slot = event;
+    return LC_OK;
+}
+
+lc_status lew_event_reg_signal(lew *context, lew_event **slot, int signal_number, lew_callback callback,
+                               void *data) {
+    CHECK_NULL(context);
+    CHECK_NULL(slot);
+    CHECK_NULL(callback);
+    CHECK_CONDITION(signal_number >= 1 && signal_number <= LEW_SIGNAL_MAX);
+    const loop_guard guard(context->loop);
+    uint32_t place;
+    const bool made = *slot == nullptr;
+    if (made) {
+        CHECK_STATUS(make_event(context, slot));
+    } else {
+        CHECK_STATUS(find_slot(context, slot, &place));
+        loop_event_remove((*slot)->registered);
+    }
+    (*slot)->callback = callback;
+    (*slot)->data = data;
+    const lc_status status = loop_event_set_signal((*slot)->registered, signal_number);
+    if (status != LC_OK && made && find_slot(context, slot, &place) == LC_OK)
+        delete_slot(context, place);
+    CHECK_STATUS(status);
+    return LC_OK;
+}
+
+lc_status lew_event_cancel(lew *context, lew_event **slot) {
+    CHECK_NULL(context);
+    CHECK_NULL(slot);
+    const loop_guard guard(context->loop);
+    if (*slot)
+        loop_event_remove((*slot)->registered);
+    return LC_OK;
+}
+
+lc_status lew_event_delete(lew *context, lew_event **slot) {
+    CHECK_NULL(context);
+    CHECK_NULL(slot);
+    const loop_guard guard(context->loop);
+    if (!*slot)
+        return LC_OK;
+    uint32_t place;
+    CHECK_STATUS(find_slot(context, slot, &place));
+    delete_slot(context, place);
+    return LC_OK;
+}
+
+lc_status lew_delete_all_events(lew *context) {
+    CHECK_NULL(context);
+    const loop_guard guard(context->loop);
+    while (context->count)
+        delete_slot(context, 0);
+    return LC_OK;
+}
+
+static lc_status dispatch(lew *context, bool once, int *out_no_events, int *out_escaped) {
+    int no_events = 0, escaped = 0;
+    if (out_no_events)
+        *out_no_events = 0;
+    if (out_escaped)
+        *out_escaped = 0;
+    CHECK_NULL(context);
+    const lc_status status = loop_run(context->loop, once, &no_events, &escaped);
+    if (out_no_events)
+        *out_no_events = no_events;
+    if (out_escaped)
+        *out_escaped = escaped;
+    CHECK_STATUS(status);
+    return LC_OK;
+}
+
+lc_status lew_dispatch(lew *context, int *out_no_events, int *out_escaped) {
+    return dispatch(context, false, out_no_events, out_escaped);
+}
+lc_status lew_dispatch_once(lew *context, int *out_no_events, int *out_escaped) {
+    return dispatch(context, true, out_no_events, out_escaped);
+}
+
+lc_status lew_escape_from_dispatch(lew *context) {
+    CHECK_NULL(context);
+    CHECK_STATUS(loop_escape(context->loop));
+    return LC_OK;
+}
+
+lc_status lew_deinit(lew **inout) {
+    CHECK_NULL(inout);
+    lew *context = *inout;
+    if (!context)
+        return LC_OK;
+    CHECK_STATUS(lew_delete_all_events(context));
+    free(context->slots);
+    loop_free(&context->loop);
+    free(context);
+    *inout = nullptr;
+    return LC_OK;
+}

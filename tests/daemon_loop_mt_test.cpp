@@ -1,0 +1,167 @@
+// The loop under other threads: escapes and posted work wake a wait, at its outer and at its inner depth.
+#include <atomic>
+#include <ctime>
+#include <functional>
+#include <thread>
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include "daemon/libevent_wrapper.h"
+
+namespace {
+
+double now_seconds() {
+    timespec now{};
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+}
+
+struct loop_thread {
+    lew *wrapper = nullptr;
+    loop_context *loop = nullptr;
+    loop_event *idle = nullptr;
+    loop_event *starter = nullptr;
+    int ends[2] = {-1, -1};
+    std::function<void()> first;
+    int escaped = 0;
+    std::atomic<int> ready{0};
+    std::thread thread;
+
+    static void nothing(int, short, void *) {}
+    static void run_first(int, short, void *data) {
+        auto *self = static_cast<loop_thread *>(data);
+        if (self->first)
+            self->first();
+    }
+    void run() {
+        ASSERT_EQ(lew_init(&wrapper), LC_OK);
+        ASSERT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
+        ASSERT_EQ(pipe(ends), 0);
+        ASSERT_EQ(loop_event_new(loop, nothing, this, &idle), LC_OK);
+        ASSERT_EQ(loop_event_set_fd(idle, ends[0], LOOP_READ), LC_OK);
+        ASSERT_EQ(loop_event_new(loop, run_first, this, &starter), LC_OK);
+        ASSERT_EQ(loop_event_set_timer(starter, 0), LC_OK);
+        ready = 1;
+        EXPECT_EQ(lew_dispatch(wrapper, nullptr, &escaped), LC_OK);
+    }
+    void start() {
+        thread = std::thread([this] { run(); });
+        while (!ready)
+            usleep(1000);
+    }
+    void finish() {
+        thread.join();
+        loop_event_free(&idle);
+        loop_event_free(&starter);
+        EXPECT_EQ(lew_deinit(&wrapper), LC_OK); // the owner has ended
+        close(ends[0]);
+        close(ends[1]);
+    }
+};
+
+TEST(LoopThreads, AnEscapeFromOutsideEndsTheWaitAtEachDepth) {
+    for (const bool nested : {false, true}) {
+        loop_thread it;
+        std::atomic<int> inner{-1};
+        if (nested)
+            it.first = [&] {
+                int escaped = 0;
+                while (!escaped)
+                    ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, &escaped), LC_OK);
+                inner = escaped;
+            };
+        it.start();
+        usleep(50000);
+        const double start = now_seconds();
+        EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
+        it.finish();
+        EXPECT_LT(now_seconds() - start, 2);
+        EXPECT_EQ(it.escaped, 1);
+        EXPECT_EQ(inner, nested ? 1 : -1);
+    }
+}
+
+struct counted_post {
+    loop_post post{};
+    std::atomic<int> *carried;
+    std::atomic<int> *withdrawn;
+    loop_context *loop;
+    int number;
+    int *expected;
+    static void function(loop_post *post, int carry_out) {
+        auto *self = reinterpret_cast<counted_post *>(post);
+        if (carry_out) {
+            EXPECT_TRUE(loop_is_own_thread(self->loop));
+            EXPECT_EQ(self->number, (*self->expected)++);
+            (*self->carried)++;
+        } else {
+            (*self->withdrawn)++;
+        }
+        delete self;
+    }
+};
+
+TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
+    constexpr int posters = 3, each = 2000;
+    std::atomic<int> carried{0}, withdrawn{0};
+    int expected[posters] = {};
+    loop_thread it;
+    it.start();
+    std::thread threads[posters];
+    for (int poster = 0; poster < posters; poster++)
+        threads[poster] = std::thread([&, poster] {
+            for (int i = 0; i < each; i++) {
+                auto *post = new counted_post{{}, &carried, &withdrawn, it.loop, i, &expected[poster]};
+                post->post.function = counted_post::function;
+                post->post.poster = &threads[poster];
+                loop_post_work(it.loop, &post->post);
+            }
+        });
+    for (std::thread &thread : threads)
+        thread.join();
+    for (const double start = now_seconds(); carried < posters * each && now_seconds() - start < 4;)
+        usleep(1000);
+    EXPECT_EQ(carried, posters * each);
+    EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
+    it.thread.join();
+    // What comes too late is handed back, by name or with the loop.
+    int unused = 0;
+    for (int i = 0; i < 2; i++) {
+        auto *post = new counted_post{{}, &carried, &withdrawn, it.loop, 0, &unused};
+        post->post.function = counted_post::function;
+        post->post.poster = i ? &withdrawn : &carried;
+        loop_post_work(it.loop, &post->post);
+    }
+    loop_withdraw_posted(it.loop, &carried);
+    EXPECT_EQ(withdrawn, 1);
+    it.thread = std::thread([] {});
+    it.finish();
+    EXPECT_EQ(withdrawn, 2);
+}
+
+// A wait for one round ends with work that was posted: what it waits for may have been changed by that.
+TEST(LoopThreads, PostedWorkEndsANestedWait) {
+    std::atomic<int> carried{0}, withdrawn{0};
+    std::atomic<int> waiting{0};
+    int expected = 0;
+    loop_thread it;
+    it.first = [&] {
+        waiting = 1;
+        while (!carried)
+            ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, nullptr), LC_OK);
+        ASSERT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
+    };
+    it.start();
+    while (!waiting)
+        usleep(1000);
+    usleep(20000);
+    const double start = now_seconds();
+    auto *post = new counted_post{{}, &carried, &withdrawn, it.loop, 0, &expected};
+    post->post.function = counted_post::function;
+    loop_post_work(it.loop, &post->post);
+    it.finish();
+    EXPECT_LT(now_seconds() - start, 2);
+}
+
+} // namespace
