@@ -188,11 +188,15 @@ lab_stop() { # NODE NAME [SIGNAL]
 }
 # The whole node at once, as if its power had gone.
 lab_kill() { # NODE
-    local pid=${LAB_PID[$1/router]-}
-    [ -z "$pid" ] || kill -KILL "$pid"
-    kill -KILL "${LAB_INIT[$1]}"
+    local key pids=("${LAB_INIT[$1]}")
+    for key in "${!LAB_PID[@]}"; do
+        [ "${key%/*}" = "$1" ] || continue
+        pids+=("${LAB_PID[$key]}")
+        unset "LAB_PID[$key]"
+    done
+    { kill -KILL "${pids[@]}"; wait "${pids[@]}"; } 2>/dev/null
     ip link del "v-$1" 2>/dev/null
-    unset "LAB_INIT[$1]" "LAB_PID[$1/router]"
+    unset "LAB_INIT[$1]"
 }
 lab_link() { # NODE up|down : the cable of a node
     ip link set "v-$1" "$2"
