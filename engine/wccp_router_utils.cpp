@@ -4,7 +4,8 @@
 // until the router has been silent for 40 seconds or the group stops. The first router decides the group's
 // forwarding, assignment and return methods for all that follow; they stand until the last router has gone.
 // The records belong to the group's list, and so do the replies to Removal Queries, each a finished message
-// with the number of times that it still has to go out.
+// with the number of times that it still has to go out. Their number is bounded: beyond it a query fails as
+// it does when memory is out.
 //
 // The engine lock is held throughout: by a receive thread for creation, decision and queries, by the timer
 // thread for the sweep and the replies. Nothing here reads a message or changes a view of its own accord.
@@ -26,6 +27,9 @@
 
 static constexpr uint32_t SILENCE_LIMIT = 40; // seconds without an I-See-You
 static constexpr uint8_t REPLY_TRANSMISSIONS = 3;
+// Each reply holds a whole packet for three seconds, and anybody can send queries: a router that needs more
+// than four answers at a time isn't one.
+static constexpr uint32_t REPLIES_WAITING = 4 * WCCP_MAX_ROUTERS;
 
 static void free_router(wccp_sending_router *router) {
     wccp_free(router);
@@ -258,8 +262,9 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
         return 0;
     }
     router->receive_id = receive_id;
-    owned<wccp_removal_reply, free_reply> reply(
-        static_cast<wccp_removal_reply *>(wccp_malloc(sizeof(wccp_removal_reply))));
+    owned<wccp_removal_reply, free_reply> reply;
+    if (group->removal_reply_count < REPLIES_WAITING)
+        reply.pointer = static_cast<wccp_removal_reply *>(wccp_malloc(sizeof(wccp_removal_reply)));
     if (!reply.pointer) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removal query request. cannot allocate pkt to send. (router id %s)",
                group->id, addr_text(router_id).s);

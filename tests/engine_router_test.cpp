@@ -185,6 +185,18 @@ TEST_F(RouterTest, AQueryIsAnsweredThreeTimesWithTheSameBytes) {
     EXPECT_EQ(group->tx_removal_replies, 3u);
 }
 
+TEST_F(RouterTest, AFloodOfQueriesIsBounded) {
+    shared->see(ROUTER_A, {ROUTER_A}, {{US, 100}});
+    int answered = 0;
+    for (int query = 0; query < 1000; query++)
+        answered += wccp_process_router_removal_query(group, ROUTER_A, host(77)) == 0;
+    EXPECT_EQ(answered, 128);
+    EXPECT_EQ(group->removal_reply_count, 128u);
+    pass_seconds(3);
+    EXPECT_EQ(group->removal_reply_count, 0u);
+    EXPECT_EQ(group->tx_removal_replies, 3u * 128);
+}
+
 TEST_F(RouterTest, QuestionsAboutRouters) {
     uint32_t one_way = 9, two_way = 9, buckets = 9;
     EXPECT_EQ(wccp_get_router_connection_stats(nullptr, &one_way, &two_way), 1);
