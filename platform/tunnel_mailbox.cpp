@@ -7,8 +7,8 @@
 // wccpd gives up a command after about two seconds and may then put another in its place, while tunneld is
 // still reading. So the inputs are read twice with looks at `command` around and between: wccpd takes
 // `command` to 0 before it touches an input, hence inputs that agree with no 0 in between belong to one
-// command. A reader that never gets there (wccpd writing for ever) takes what it has; it looks at `command`
-// again before it acts.
+// command. A reader that doesn't get there in a thousand tries (there is no command any more, or wccpd stands
+// still in the middle of writing one) takes what it has; it looks at `command` again before it acts.
 
 #include "platform/tunnel_mailbox.h"
 
@@ -79,7 +79,7 @@ inputs read_inputs(const wccp_tunnel_mailbox *mailbox) {
         const inputs second = read_once(mailbox);
         const uint16_t after = mailbox->command.load(std::memory_order_acquire);
         const bool whole = before == between && between == after && before != MAILBOX_IDLE && first == second;
-        if (whole || after == MAILBOX_IDLE || tries == 1000)
+        if (whole || tries == 1000)
             return second;
     }
 }
