@@ -1,0 +1,233 @@
+// The tunnel table against a tunneld that answers, refuses, says nothing, or is left waiting.
+
+#include "engine/wccp_tunnel.h"
+
+#include <gtest/gtest.h>
+#include <pthread.h>
+
+#include <chrono>
+#include <set>
+#include <string>
+
+#include "engine/wccp_host.h"
+#include "engine/wccpd_common.h"
+#include "tests/support/fake_tunneld.h"
+#include "tests/support/log_lines.h"
+
+namespace {
+
+const be32 self = to_be32(0x0A000001);
+
+be32 router(uint32_t number) {
+    return to_be32(0x0A000100 + number);
+}
+
+struct Tunnels : testing::Test {
+    static void SetUpTestSuite() {
+        write_mem_conf();
+        ASSERT_EQ(wccp_init_shmem(), 0);
+    }
+    Tunnels() : tunneld(tunneld_does) {
+        allocated = wccp_g.stat_allocs - wccp_g.stat_frees;
+        wccpd_exiting = 0;
+    }
+    ~Tunnels() override {
+        wccpd_exiting = 0;
+        tunneld.answer_with(tunneld_does);
+        EXPECT_EQ(wccp_del_all_tunnels(), 0);
+        EXPECT_EQ(wccp_g.stat_allocs - wccp_g.stat_frees, allocated) << "every record is free again";
+        // All 32 ids are there again, whatever the test did.
+        tunneld.take_commands();
+        std::set<uint16_t> ids;
+        for (uint32_t i = 0; i < 32; i++)
+            EXPECT_EQ(wccp_add_tunnel(1, self, router(i)), 0);
+        for (const seen_command &command : tunneld.take_commands())
+            ids.insert(command.tunnel_id);
+        EXPECT_EQ(ids.size(), 32u);
+        wccp_del_all_tunnels();
+    }
+    std::vector<seen_command> commands() { return tunneld.take_commands(); }
+
+    fake_tunneld tunneld;
+    uint32_t allocated;
+    log_lines log;
+};
+
+std::optional<tunneld_answer> tunneld_refuses(const seen_command &command) {
+    return tunneld_answer{1, command.code == MAILBOX_ADD_TUNNEL ? 5u : command.index};
+}
+
+} // namespace
+
+TEST_F(Tunnels, GroupsThatShareARouterShareTheTunnel) {
+    EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
+    EXPECT_EQ(wccp_add_tunnel(52, self, router(1)), 0);
+    auto given = commands();
+    ASSERT_EQ(given.size(), 1u);
+    EXPECT_EQ(given[0].code, MAILBOX_ADD_TUNNEL);
+    EXPECT_EQ(given[0].tunnel_id, g_qv_encap_wccp_first);
+    EXPECT_EQ(given[0].local, 0x0A000001u) << "host order";
+    EXPECT_EQ(given[0].remote, 0x0A000101u);
+    EXPECT_EQ(given[0].index, WCCP_NO_INDEX);
+    EXPECT_NE(log.take().find("WCCP GRP 51: created GRE tunnel id 1000 10.0.0.1 <=> 10.0.1.1"),
+              std::string::npos);
+
+    EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
+    EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "no such tunnel";
+    EXPECT_EQ(commands().size(), 0u);
+    EXPECT_EQ(wccp_del_tunnel(52, self, router(1), 0), 0);
+    given = commands();
+    ASSERT_EQ(given.size(), 1u);
+    EXPECT_EQ(given[0].code, MAILBOX_DELETE_TUNNEL);
+    EXPECT_EQ(given[0].index, 1000u + g_qv_encap_wccp_first) << "the index of its add";
+    EXPECT_NE(log.take().find("WCCP GRP 52: deleted GRE tunnel id: 1000 10.0.0.1 <=> 10.0.1.1"),
+              std::string::npos);
+}
+
+TEST_F(Tunnels, ForceIgnoresTheReferences) {
+    wccp_add_tunnel(51, self, router(1));
+    wccp_add_tunnel(52, self, router(1));
+    EXPECT_EQ(wccp_del_tunnel(0, self, router(1), 1), 0);
+    EXPECT_NE(log.take().find("WCCP : deleted GRE tunnel id: 1000"), std::string::npos);
+    EXPECT_EQ(commands().size(), 2u);
+    EXPECT_EQ(wccp_del_tunnel(52, self, router(1), 0), 0);
+    EXPECT_EQ(commands().size(), 0u);
+}
+
+TEST_F(Tunnels, ThirtyTwoIdsAndTheFreedOneIsNext) {
+    for (uint32_t i = 0; i < 32; i++)
+        ASSERT_EQ(wccp_add_tunnel(1, self, router(i)), 0);
+    EXPECT_EQ(commands().back().tunnel_id, g_qv_encap_wccp_last);
+    EXPECT_EQ(wccp_add_tunnel(1, self, router(32)), 1);
+    EXPECT_NE(log.take().find("WCCP GRP 1: No free tunnel id available"), std::string::npos);
+    EXPECT_EQ(wccp_add_tunnel(1, self, router(4)), 0) << "an old one needs no id";
+    EXPECT_EQ(commands().size(), 0u);
+    for (const uint32_t i : {31u, 7u}) {
+        EXPECT_EQ(wccp_del_tunnel(1, self, router(i), 0), 0);
+        EXPECT_EQ(wccp_add_tunnel(1, self, router(32 + i)), 0);
+        EXPECT_EQ(commands().back().tunnel_id, g_qv_encap_wccp_first + i);
+    }
+}
+
+TEST_F(Tunnels, ARefusedAddLeavesNothing) {
+    for (const auto answer : {tunneld_refuses, +[](const seen_command &) -> std::optional<tunneld_answer> {
+                                  return tunneld_answer{0, WCCP_NO_INDEX};
+                              }}) {
+        tunneld.answer_with(answer);
+        EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 1);
+        EXPECT_NE(log.take().find("WCCP GRP 51: failed to add tunnel: id: 1000 10.0.0.1 <=> 10.0.1.1"),
+                  std::string::npos);
+        EXPECT_EQ(commands().size(), 1u);
+        EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
+        EXPECT_EQ(commands().size(), 0u) << "it isn't in the table";
+    }
+    tunneld.answer_with(tunneld_does);
+    EXPECT_EQ(wccp_add_tunnel(51, self, router(2)), 0);
+    EXPECT_EQ(commands()[0].tunnel_id, g_qv_encap_wccp_first);
+}
+
+TEST_F(Tunnels, ARefusedDeleteTakesTheTunnelOutAllTheSame) {
+    wccp_add_tunnel(51, self, router(1));
+    wccp_add_tunnel(51, self, router(2));
+    tunneld.answer_with(tunneld_refuses);
+    EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 1);
+    EXPECT_NE(log.take().find("WCCP GRP 51: failed to delete GRE tunnel id: 1000"), std::string::npos);
+    wccpd_exiting = 1;
+    EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "in silence during the exit";
+    EXPECT_EQ(log.take().find("failed to delete"), std::string::npos);
+    commands();
+    wccp_del_all_tunnels();
+    EXPECT_EQ(commands().size(), 0u);
+}
+
+TEST_F(Tunnels, RestoreGivesEveryTunnelAgainAndKeepsThemAll) {
+    for (uint32_t i = 0; i < 3; i++)
+        wccp_add_tunnel(1, self, router(i));
+    commands();
+    tunneld.answer_with([](const seen_command &command) {
+        return command.tunnel_id == g_qv_encap_wccp_first + 1 ? tunneld_refuses(command)
+                                                              : tunneld_answer{0, 70u + command.tunnel_id};
+    });
+    EXPECT_EQ(wccp_restore_all_tunnels(), 0);
+    auto given = commands();
+    ASSERT_EQ(given.size(), 3u);
+    EXPECT_EQ(given[0].tunnel_id, g_qv_encap_wccp_first + 2) << "the newest first";
+    EXPECT_NE(log.take().find("WCCP:retore tunnel: failed to create tunnel. id: 1001 10.0.0.1 <=> 10.0.1.1"),
+              std::string::npos);
+    wccp_del_all_tunnels();
+    given = commands();
+    ASSERT_EQ(given.size(), 3u);
+    EXPECT_EQ(given[2].index, 70u + g_qv_encap_wccp_first) << "the new index";
+}
+
+// A thread that is cancelled while it waits for tunneld.
+TEST_F(Tunnels, ACancelledAddGivesIdAndRecordBack) {
+    tunneld.answer_with(tunneld_is_silent);
+    for (int i = 0; i < 3; i++) {
+        pthread_t adder;
+        ASSERT_EQ(pthread_create(
+                      &adder, nullptr,
+                      [](void *) -> void * {
+                          wccp_add_tunnel(51, self, router(1));
+                          return nullptr;
+                      },
+                      nullptr),
+                  0);
+        tunneld.wait_for_command();
+        pthread_cancel(adder);
+        void *result = nullptr;
+        pthread_join(adder, &result);
+        ASSERT_EQ(result, PTHREAD_CANCELED);
+        EXPECT_EQ(wccp_g.stat_allocs - wccp_g.stat_frees, allocated);
+        EXPECT_EQ(wccp_get_tunnel_command(), 0) << "nobody knows the tunnel that would come of it";
+    }
+    tunneld.answer_with(tunneld_does);
+    commands();
+    EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
+    EXPECT_EQ(commands()[0].tunnel_id, g_qv_encap_wccp_first);
+}
+
+TEST_F(Tunnels, ACancelledDeleteStillTakesTheTunnelOut) {
+    EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
+    EXPECT_EQ(wccp_add_tunnel(51, self, router(2)), 0);
+    tunneld.answer_with(tunneld_is_silent);
+    pthread_t deleter;
+    ASSERT_EQ(pthread_create(
+                  &deleter, nullptr,
+                  [](void *) -> void * {
+                      wccp_del_tunnel(51, self, router(1), 0);
+                      return nullptr;
+                  },
+                  nullptr),
+              0);
+    tunneld.wait_for_command();
+    pthread_cancel(deleter);
+    void *result = nullptr;
+    pthread_join(deleter, &result);
+    ASSERT_EQ(result, PTHREAD_CANCELED);
+    tunneld.answer_with(tunneld_does);
+    commands();
+    EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0) << "and the mutex is free";
+    EXPECT_EQ(commands().size(), 0u) << "it is out of the table";
+    EXPECT_EQ(wccp_add_tunnel(51, self, router(3)), 0);
+    EXPECT_EQ(commands()[0].tunnel_id, g_qv_encap_wccp_first) << "its id is free";
+}
+
+// Tunnels come and go on several threads while all are deleted, as at exit.
+TEST_F(Tunnels, DeletingAllWhileOthersAddAndDelete) {
+    std::atomic<bool> stop = false;
+    std::vector<std::thread> others;
+    for (uint32_t other = 0; other < 3; other++)
+        others.emplace_back([other, &stop] {
+            for (uint32_t i = 0; !stop; i++) {
+                const be32 mine = router(100 + other * 20 + i % 5);
+                wccp_add_tunnel(other, self, mine);
+                wccp_del_tunnel(other, self, mine, 0);
+            }
+        });
+    for (int i = 0; i < 10; i++)
+        EXPECT_EQ(wccp_del_all_tunnels(), 0);
+    stop = true;
+    for (std::thread &other : others)
+        other.join();
+}
