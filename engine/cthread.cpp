@@ -132,9 +132,7 @@ static void unlist(cthread *context) {
     context->listed = 0;
 }
 
-// thread_list_mutex held.
-static void unlist_and_cancel(cthread *context) {
-    unlist(context);
+static void cancel(cthread *context) {
     const int error = pthread_cancel(context->thread);
     if (error != 0)
         QV_LOG(LC_LOG_ERR, "%s: failed to cancel %s with error %d\n", "cthread_cancel", context->name, error);
@@ -144,7 +142,8 @@ void cthread_cancel(cthread *context) {
     if (!context || context->heartbeat == 0)
         return;
     const mutex_guard guard(&thread_list_mutex);
-    unlist_and_cancel(context);
+    unlist(context);
+    cancel(context);
 }
 
 void cthread_join(cthread *context) {
@@ -163,11 +162,12 @@ void cthread_join(cthread *context) {
 
 cthread *cthread_cancel_listed() {
     const mutex_guard guard(&thread_list_mutex);
-    cthread *chain = nullptr;
-    while (cthread *context = thread_list) {
-        unlist_and_cancel(context);
-        context->next = chain;
-        chain = context;
+    cthread *chain = thread_list;
+    thread_list = nullptr;
+    for (cthread *context = chain; context; context = context->next) {
+        context->prev_link = nullptr;
+        context->listed = 0;
+        cancel(context);
     }
     return chain;
 }
