@@ -1,0 +1,88 @@
+// A growable buffer of bytes, for frames. A NUL stands behind the last byte. Readers check against the
+// length: a number past the end gives LC_ASSERTION, a string LC_NO_BUFFER_SPACE.
+#pragma once
+
+#include <cstdint>
+
+#include "runtime/common.h"
+
+struct tstring;
+struct tstr_array;
+
+constexpr uint32_t tb_size_initial = 128;
+constexpr uint32_t tb_size_growth_factor = 4;
+constexpr uint32_t tb_size_max = 0x10000000;
+constexpr uint32_t tb_size_max_extra_growth = 0x800000;
+constexpr uint32_t tb_size_chunk_size_mask = 0xfff;
+constexpr uint32_t tb_size_shrink_threshold = 6;
+
+struct tbuffer {
+    uint8_t *buffer;
+    uint32_t length;
+    uint32_t size;
+    uint8_t auto_shrink;
+    uint8_t constant; // the bytes are borrowed; writers refuse
+};
+
+lc_status tb_new(tbuffer **out);
+lc_status tb_new_size(tbuffer **out, uint32_t size);
+lc_status tb_new_buf(tbuffer **out, const void *bytes, int32_t length); // -1: strlen
+lc_status tb_new_takeover(tbuffer **out, uint8_t **inout_bytes, uint32_t length, uint32_t size);
+lc_status tb_new_buf_const(tbuffer **out, const void *bytes, uint32_t length);
+lc_status tb_free(tbuffer **inout);
+lc_status tb_detach(tbuffer **inout, uint8_t **out_bytes, uint32_t *out_length);
+lc_status tb_dup(const tbuffer *buffer, tbuffer **out);
+lc_status tb_set_auto_shrink(tbuffer *buffer, int on);
+
+int32_t tb_length(const tbuffer *buffer); // -1 for null
+uint32_t tb_size(const tbuffer *buffer);
+uint32_t tb_avail(const tbuffer *buffer); // size less length
+uint8_t *tb_buf(const tbuffer *buffer);   // a null buffer is logged
+uint8_t *tb_buf_maybe(const tbuffer *buffer);
+lc_status tb_ensure_size(tbuffer *buffer, uint32_t size);
+lc_status tb_set_length(tbuffer *buffer, uint32_t length); // LC_GENERIC when more than the size
+lc_status tb_clear(tbuffer *buffer);
+lc_status tb_delete_bytes(tbuffer *buffer, uint32_t offset, uint32_t count);
+
+// An offset beyond the length fills the gap with zero bytes.
+lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t count);
+lc_status tb_append_buf(tbuffer *buffer, const void *bytes, uint32_t count);
+// One number, stored as it lies in memory: whoever writes the wire swaps it first.
+lc_status tb_put_byte(tbuffer *buffer, uint32_t offset, uint8_t byte);
+lc_status tb_put_uint8(tbuffer *buffer, uint32_t offset, uint8_t value);
+lc_status tb_put_uint16(tbuffer *buffer, uint32_t offset, uint16_t value);
+lc_status tb_put_uint32(tbuffer *buffer, uint32_t offset, uint32_t value);
+lc_status tb_put_uint64(tbuffer *buffer, uint32_t offset, uint64_t value);
+lc_status tb_append_uint8(tbuffer *buffer, uint8_t value);
+lc_status tb_append_uint16(tbuffer *buffer, uint16_t value);
+lc_status tb_append_uint32(tbuffer *buffer, uint32_t value);
+lc_status tb_append_uint64(tbuffer *buffer, uint64_t value);
+lc_status tb_get_uint8(const tbuffer *buffer, uint32_t offset, uint8_t *out);
+lc_status tb_get_uint16(const tbuffer *buffer, uint32_t offset, uint16_t *out);
+lc_status tb_get_uint32(const tbuffer *buffer, uint32_t offset, uint32_t *out);
+lc_status tb_get_uint64(const tbuffer *buffer, uint32_t offset, uint64_t *out);
+lc_status tb_get_uint128(const tbuffer *buffer, uint32_t offset, uint8_t out[16]);
+
+// A string with an optional 4-byte length word, which counts the NUL when one is added and stands in network
+// order with `swap`. `length` -1 is strlen. Outs may be null; `out_written` and `out_used` count all bytes.
+lc_status tb_put_str(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
+                     const char *text, int32_t length, uint32_t *out_written);
+lc_status tb_put_tstr(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
+                      const tstring *string, uint32_t *out_written); // a null string: the empty one
+lc_status tb_append_tstr(tbuffer *buffer, int add_nul, int length_word, int swap, const tstring *string);
+// A 4-byte count, then each string with its length word.
+lc_status tb_put_tstr_array(tbuffer *buffer, uint32_t offset, int add_nul, int swap, const tstr_array *array,
+                            uint32_t *out_written);
+lc_status tb_append_tstr_array(tbuffer *buffer, int add_nul, int swap, const tstr_array *array);
+// Without a length word `length` says how much to read, -1 being all the rest. The text is the caller's.
+lc_status tb_get_str(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
+                     int swap, char **out_text, uint32_t *out_length, uint32_t *out_used);
+lc_status tb_get_tstr(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
+                      int swap, tstring **out, uint32_t *out_used);
+lc_status tb_get_tstr_array(const tbuffer *buffer, uint32_t offset, int expect_nul, int swap,
+                            tstr_array **out, uint32_t *out_used);
+
+// Owner for a scope.
+inline void tb_release(tbuffer *buffer) {
+    (void)tb_free(&buffer);
+}

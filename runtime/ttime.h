@@ -1,0 +1,70 @@
+// Units of time and their texts. A date is "%Y/%m/%d", a time of day "%H:%M:%S" with an optional fraction,
+// a date-time the two with a blank between.
+#pragma once
+
+#include <sys/time.h>
+
+#include <cstdint>
+#include <ctime>
+
+#include "runtime/common.h"
+
+using lt_date = uint32_t;    // seconds since 1970 of midnight UTC of the date
+using lt_time_sec = int32_t; // since 1970, or the offset from midnight
+using lt_time_ms = int64_t;
+using lt_time_us = int64_t;
+using lt_dur_sec = int32_t;
+using lt_dur_ms = int64_t;
+using lt_dur_us = int64_t;
+
+// The wall clock.
+lt_time_sec lt_curr_time();
+lt_time_ms lt_curr_time_ms();
+lt_time_us lt_curr_time_us();
+
+lc_status lt_time_sec_to_tm(lt_time_sec seconds, tm *out); // local
+lc_status lt_time_sec_to_tm_utc(lt_time_sec seconds, tm *out);
+lt_time_us lt_tm_to_time_us(const tm *local); // null is logged and gives 0
+lt_time_sec lt_tm_utc_to_time_sec(const tm *utc);
+lc_status lt_time_sec_to_timeval(lt_time_sec seconds, timeval *out);
+lc_status lt_time_ms_to_timeval(lt_time_ms ms, timeval *out);
+lt_time_sec lt_timeval_to_time_sec(const timeval *value);
+lt_time_ms lt_timeval_to_time_ms(const timeval *value);
+
+// Value to text. LC_ASSERTION when it doesn't fit; the _to_str forms allocate, the caller frees. Dates and
+// times of day are UTC, date-times are local, with "%z" behind them on request.
+lc_status lt_date_to_buf(lt_date value, uint32_t size, char *buffer, uint32_t *out_length);
+lc_status lt_date_to_str(lt_date value, char **out);
+lc_status lt_daytime_sec_to_buf(lt_time_sec value, uint32_t size, char *buffer);
+lc_status lt_daytime_ms_to_buf(lt_time_ms value, uint32_t size, char *buffer);
+lc_status lt_daytime_us_to_buf(lt_time_us value, uint32_t size, char *buffer);
+lc_status lt_daytime_sec_to_str(lt_time_sec value, char **out);
+lc_status lt_daytime_ms_to_str(lt_time_ms value, char **out);
+lc_status lt_daytime_us_to_str(lt_time_us value, char **out);
+lc_status lt_datetime_sec_to_buf(lt_time_sec value, int with_zone, uint32_t size, char *buffer);
+lc_status lt_datetime_ms_to_buf(lt_time_ms value, int with_zone, uint32_t size, char *buffer);
+lc_status lt_datetime_us_to_buf(lt_time_us value, int with_zone, uint32_t size, char *buffer);
+lc_status lt_datetime_sec_to_str(lt_time_sec value, int with_zone, char **out);
+lc_status lt_datetime_ms_to_str(lt_time_ms value, int with_zone, char **out);
+lc_status lt_datetime_us_to_str(lt_time_us value, int with_zone, char **out);
+lc_status lt_dur_sec_to_buf(lt_dur_sec value, uint32_t size, char *buffer);
+lc_status lt_dur_ms_to_buf(lt_dur_ms value, uint32_t size, char *buffer);
+lc_status lt_dur_us_to_buf(lt_dur_us value, uint32_t size, char *buffer);
+lc_status lt_dur_sec_to_str(lt_dur_sec value, char **out);
+lc_status lt_dur_ms_to_str(lt_dur_ms value, char **out);
+lc_status lt_dur_us_to_str(lt_dur_us value, char **out);
+
+// Text to value. LC_BAD_TYPE for what doesn't parse, without a line; LC_ASSERTION out of range.
+lc_status lt_str_to_date(const char *text, lt_date *out);
+lc_status lt_str_to_daytime_sec(const char *text, lt_time_sec *out);
+lc_status lt_str_to_daytime_ms(const char *text, lt_time_ms *out);
+lc_status lt_str_to_daytime_us(const char *text, lt_time_us *out);
+lc_status lt_str_to_datetime_sec(const char *text, lt_time_sec *out);
+lc_status lt_str_to_datetime_ms(const char *text, lt_time_ms *out);
+lc_status lt_str_to_datetime_us(const char *text, lt_time_us *out);
+lc_status lt_str_to_dur_sec(const char *text, lt_dur_sec *out);
+lc_status lt_str_to_dur_ms(const char *text, lt_dur_ms *out);
+lc_status lt_str_to_dur_us(const char *text, lt_dur_us *out);
+
+// Makes the C library read the time zone again.
+lc_status lt_timezone_handle_changed();
