@@ -231,7 +231,7 @@ lab_wait_line() { # SECONDS EXPRESSION FILE
 
 # Writes what passes the bridge to a file until the lab ends or lab_capture_end.
 lab_capture() { # FILE
-    tcpdump -i lan -U -Z root -w "$1" udp port 2048 </dev/null >"$LAB/tcpdump.out" 2>&1 &
+    tcpdump -i lan --immediate-mode -U -Z root -w "$1" udp port 2048 </dev/null >"$LAB/tcpdump.out" 2>&1 &
     LAB_CAPTURE=$!
     lab_wait_line 10 'listening on' "$LAB/tcpdump.out"
 }

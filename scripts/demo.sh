@@ -33,7 +33,7 @@ fi
 export WCCP_BIN
 # shellcheck source=../lab/topology.sh
 source "$top/lab/topology.sh"
-lab_farewell() { [ -n "$plain" ] || printf '\033[?25h\033[0m'; }
+lab_farewell() { [ -n "$plain" ] || printf '\033[?25h\033[?7h\033[0m'; }
 lab_enter "$0" "${arguments[@]}"
 
 # ---- who takes part
@@ -116,7 +116,7 @@ picture() {
                 set -- $owners
                 printf "  group $id   by $kind: $(draw_runs "$@")   (table $change of ${letter[$key]:-$key})\033[K\n"
                 draw_strip "$@"
-                [ $# -gt 64 ] || printf '\033[K\n'
+                [ $# -gt 64 ] || printf '\033[K\n' # two lines, whatever the table
             else
                 printf "  group $id   no table\033[K\n\033[K\n\033[K\n"
             fi
@@ -172,11 +172,11 @@ table_of() { # GROUP ADDRESS : every slot has an owner, by a table of that appli
 }
 asked() { [[ ${members_of[51]} = *' 1'$'\n'* ]] || [[ ${members_of[51]} = *' 1' ]] || members_are 51 2; }
 designated() { [[ ${brief_of[$1/51]} = *designated* ]] && [[ ${brief_of[$1/52]} = *designated* ]]; } # APPLIANCE
-table_or_all() { table_of "$@"; }
 
 # ---- the story
 
-[ -n "$plain" ] || printf '\033[?25l'
+# no cursor, and no second line of what is too long for the terminal
+[ -n "$plain" ] || printf '\033[?25l\033[?7l'
 SECONDS=0
 step='two routers and two appliances start'
 [ -z "$capture" ] || lab_capture "$capture" || exit 1
@@ -219,11 +219,8 @@ await 40 17 'the first table of B' table_of 51 10.0.0.102
 await 40 1 'the mask table of B' table_of 52 10.0.0.102
 show_table 51
 show_table 52
-step='done'
-[ -z "$capture" ] || { lab_capture_end; [ "$(id -u)" != 0 ] || chmod a+r "$capture"; echo "packets: $capture"; }
-for a in a2; do
-    lab_stop $a host || echo "demo: the appliance ended with $?"
-    lab_stop $a tunneld
-done
-[ -n "$plain" ] && echo "$(clock) done" || { awaited='nothing'; printf '\033[?25h'; }
+[ -z "$capture" ] || { lab_capture_end; chmod a+r "$capture"; echo "packets: $capture"; }
+lab_stop a2 host || lab_die "the appliance ended with $?"
+lab_stop a2 tunneld || lab_die "tunneld ended with $?"
+if [ -n "$plain" ]; then echo "$(clock) done"; fi
 exit 0
