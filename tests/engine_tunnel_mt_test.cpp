@@ -206,6 +206,8 @@ TEST_F(Tunnels, ACancelledDeleteStillTakesTheTunnelOut) {
     pthread_join(deleter, &result);
     ASSERT_EQ(result, PTHREAD_CANCELED);
     tunneld.answer_with(tunneld_does);
+    while (wccp_get_tunnel_command() != MAILBOX_IDLE) // the delete is carried out late
+        std::this_thread::yield();
     commands();
     EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0) << "and the mutex is free";
     EXPECT_EQ(commands().size(), 0u) << "it is out of the table";
@@ -219,10 +221,11 @@ TEST_F(Tunnels, DeletingAllWhileOthersAddAndDelete) {
     std::vector<std::thread> others;
     for (uint32_t other = 0; other < 3; other++)
         others.emplace_back([other, &stop] {
-            for (uint32_t i = 0; !stop; i++) {
-                const be32 mine = router(100 + other * 20 + i % 5);
-                wccp_add_tunnel(other, self, mine);
-                wccp_del_tunnel(other, self, mine, 0);
+            while (!stop) {
+                for (uint32_t i = 0; i < 8; i++)
+                    wccp_add_tunnel(other, self, router(100 + other * 20 + i));
+                for (uint32_t i = 0; i < 8; i++)
+                    wccp_del_tunnel(other, self, router(100 + other * 20 + i), 0);
             }
         });
     for (int i = 0; i < 10; i++)
