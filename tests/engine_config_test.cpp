@@ -478,8 +478,10 @@ TEST_F(Config, RoutersAreNumberedFromOneInListOrder) {
     first->flags = WCCP_RTR_TWO_WAY;
     first->state_time = 20;
     first->view_appliances[first->view_appliance_count++].ipa = ipa("10.1.0.1");
-    first->view_appliances[first->view_appliance_count++] = {
-        .ipa = ipa("10.1.0.4"), .weight = 1, .buckets_assigned = 2, .buckets_total = 3};
+    wccp_rtr_view_appliance *loaded = &first->view_appliances[first->view_appliance_count++];
+    loaded->ipa = ipa("10.1.0.4");
+    loaded->buckets_assigned = 2;
+    loaded->buckets_total = 3;
 
     wccp_grp_router_info info = {};
     info.router_num = 1;
