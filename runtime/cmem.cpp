@@ -1,0 +1,424 @@
+// Named blocks of System V shared memory, found by all processes of the appliance through one registry
+// segment.
+//
+// The registry is a format: 2000 block records, 400 entries of "mem.conf" and a state word, which the first
+// process swaps from empty to loading and sets to ready. A free record is claimed by compare-and-swap, since
+// several processes may create at once. Only a registry that cannot be attached stops the process.
+//
+// A key may belong to a segment that someone else has made, of another size: its size is looked at before a
+// byte of it is used. A block that is too short is refused like one that cannot be attached; a registry that
+// is too short counts as one that cannot be attached.
+#include "runtime/cmem.h"
+
+#include <atomic>
+#include <cctype>
+#include <cerrno>
+#include <cstddef>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include <numa.h>
+#include <sys/shm.h>
+#include <unistd.h>
+
+#include "runtime/common.h"
+#include "runtime/guards.h"
+#include "runtime/logging.h"
+
+constexpr uint32_t MAX_BLOCKS = 2000;
+constexpr uint32_t MAX_CONF = 400;
+constexpr uint32_t NAME_BYTES = 32;
+constexpr uint64_t NORMAL_PAGE = 4096;
+constexpr uint64_t HUGE_PAGE_BYTES = 0x200000;
+constexpr int SHARED_MODE = 0777;
+enum : int32_t { NODE_LOCAL = -2, NODE_INTERLEAVED = -1 };
+enum : uint32_t { REGISTRY_EMPTY = 0, REGISTRY_LOADING = 0xFFFFFFFF, REGISTRY_READY = 1 };
+
+struct cmem_block {
+    char name[NAME_BYTES];
+    char owner[NAME_BYTES]; // program, for diagnostics
+    uint64_t length;        // rounded up to the page size
+    uint64_t page_size;
+    int32_t node;
+    uint32_t key;
+    uint64_t zero;
+    uint64_t attach_address; // requested, 0 for any
+    uint64_t creator_address;
+    int32_t pid;
+    uint32_t alignment;
+    uint64_t counters[4];
+    uint32_t diagnostic;
+    uint32_t configured;
+    std::atomic<uint32_t> in_use;
+    uint32_t tail;
+};
+struct cmem_conf {
+    char name[NAME_BYTES];
+    uint64_t page_size;
+    uint64_t attach_address;
+    int32_t node;
+    uint32_t key;
+    uint64_t zero;
+};
+struct cmem_registry {
+    cmem_block blocks[MAX_BLOCKS];
+    cmem_conf conf[MAX_CONF];
+    std::atomic<uint32_t> state;
+    uint32_t tail;
+};
+static_assert(sizeof(cmem_block) == 168 && offsetof(cmem_block, owner) == 32 &&
+              offsetof(cmem_block, length) == 64);
+static_assert(offsetof(cmem_block, page_size) == 72 && offsetof(cmem_block, node) == 80);
+static_assert(offsetof(cmem_block, key) == 84 && offsetof(cmem_block, zero) == 88);
+static_assert(offsetof(cmem_block, attach_address) == 96 && offsetof(cmem_block, creator_address) == 104);
+static_assert(offsetof(cmem_block, pid) == 112 && offsetof(cmem_block, counters) == 120);
+static_assert(offsetof(cmem_block, diagnostic) == 152 && offsetof(cmem_block, configured) == 156);
+static_assert(offsetof(cmem_block, in_use) == 160);
+static_assert(sizeof(cmem_conf) == 64 && offsetof(cmem_conf, page_size) == 32);
+static_assert(offsetof(cmem_conf, attach_address) == 40 && offsetof(cmem_conf, node) == 48);
+static_assert(offsetof(cmem_conf, key) == 52 && offsetof(cmem_conf, zero) == 56);
+static_assert(offsetof(cmem_registry, conf) == 336000 && offsetof(cmem_registry, state) == 361600);
+static_assert(sizeof(cmem_registry) == 361608);
+
+static cmem_registry *registry;
+static pthread_mutex_t registry_lock = PTHREAD_MUTEX_INITIALIZER;
+
+#define CMEM_LOG(level, ...)                                                                                 \
+    do {                                                                                                     \
+        if (lc_log_check_level(level))                                                                       \
+            (void)qv_log_internal((level), nullptr, nullptr, __VA_ARGS__);                                   \
+    } while (0)
+
+// --- mem.conf
+// -------------------------------------------------------------------------------------------------------
+
+static bool parse_node(const char *word, int32_t *out) {
+    if (strcmp(word, "inter") == 0)
+        *out = NODE_INTERLEAVED;
+    else if (strcmp(word, "local") == 0)
+        *out = NODE_LOCAL;
+    else if (isdigit(static_cast<unsigned char>(word[0])) && word[1] == '\0')
+        *out = word[0] - '0';
+    else
+        return false;
+    return true;
+}
+
+static bool huge_pages_supported() {
+    return access("/sys/kernel/mm/hugepages/hugepages-2048kB", F_OK) == 0;
+}
+
+static bool parse_page_size(const char *word, uint64_t *out) {
+    if (strcmp(word, "normal") == 0)
+        *out = NORMAL_PAGE;
+    else if (strcmp(word, "huge") == 0)
+        *out = huge_pages_supported() ? HUGE_PAGE_BYTES : NORMAL_PAGE;
+    else
+        return false;
+    return true;
+}
+
+// False for a line that is passed over.
+static bool parse_conf_line(const char *line, cmem_conf *out) {
+    char name[128], node[32], page[32], key[32], address[32] = "0";
+    const char *text = line + strspn(line, " \t");
+    if (*text == '#' || sscanf(text, "%127s %31s %31s %31s %31s", name, node, page, key, address) < 4)
+        return false;
+    *out = {};
+    name[NAME_BYTES - 1] = '\0';
+    memcpy(out->name, name, strlen(name));
+    if (!parse_node(node, &out->node)) {
+        CMEM_LOG(LC_LOG_ERR, "%s: error parsing affinity at line %s\n", __func__, line);
+        return false;
+    }
+    if (!parse_page_size(page, &out->page_size)) {
+        CMEM_LOG(LC_LOG_ERR, "%s: error parsing page size at line %s\n", __func__, line);
+        return false;
+    }
+    out->key = static_cast<uint32_t>(strtoul(key, nullptr, 16));
+    out->attach_address = strtoull(address, nullptr, 16);
+    return true;
+}
+
+static void load_conf(cmem_registry *fresh) {
+    FILE *file = fopen(CMEM_CONF_PATH, "re");
+    if (!file)
+        return;
+    char line[256];
+    uint32_t count = 0;
+    for (uint32_t read = 0; read < MAX_CONF && fgets(line, sizeof line, file); read++) {
+        line[strcspn(line, "\n")] = '\0';
+        if (parse_conf_line(line, &fresh->conf[count]))
+            count++;
+    }
+    fclose(file);
+}
+
+// --- The registry
+// ---------------------------------------------------------------------------------------------------
+
+// Bytes behind a segment, 0 when it cannot be told.
+static uint64_t segment_bytes(int id) {
+    shmid_ds status = {};
+    return shmctl(id, IPC_STAT, &status) == 0 ? status.shm_segsz : 0;
+}
+
+static cmem_registry *attach_registry() {
+    const mutex_guard guard(&registry_lock);
+    if (registry)
+        return registry;
+    const int id = shmget(CMEM_REGISTRY_KEY, 0, 0);
+    const int made = id >= 0 ? id : shmget(CMEM_REGISTRY_KEY, sizeof(cmem_registry), IPC_CREAT | SHARED_MODE);
+    void *memory = reinterpret_cast<void *>(-1);
+    if (made >= 0 && segment_bytes(made) < sizeof(cmem_registry))
+        errno = EINVAL;
+    else if (made >= 0)
+        memory = shmat(made, nullptr, 0);
+    if (memory == reinterpret_cast<void *>(-1)) {
+        CMEM_LOG(LC_LOG_ERR, "%s: Cannot attach to shmem, err=%s\n", __func__, strerror(errno));
+        abort();
+    }
+    cmem_registry *attached = static_cast<cmem_registry *>(memory);
+    uint32_t expected = REGISTRY_EMPTY;
+    if (attached->state.compare_exchange_strong(expected, REGISTRY_LOADING)) {
+        load_conf(attached);
+        attached->state = REGISTRY_READY;
+    }
+    while (attached->state != REGISTRY_READY)
+        sleep(1);
+    registry = attached;
+    return registry;
+}
+
+static cmem_block *find_block(cmem_registry *known, const char *name) {
+    for (cmem_block &block : known->blocks)
+        if (block.in_use && strncmp(block.name, name, NAME_BYTES - 1) == 0)
+            return &block;
+    return nullptr;
+}
+
+static cmem_block *claim_block(cmem_registry *known) {
+    for (cmem_block &block : known->blocks) {
+        uint32_t expected = 0;
+        if (block.in_use.compare_exchange_strong(expected, 1))
+            return &block;
+    }
+    return nullptr;
+}
+
+static void free_block(cmem_block *block) {
+    memset(block->name, 0, sizeof block->name);
+    block->in_use = 0;
+}
+
+static bool creator_lives(const cmem_block *block) {
+    char path[64];
+    snprintf(path, sizeof path, "/proc/%d/numa_maps", block->pid);
+    FILE *file = fopen(path, "re");
+    if (!file)
+        return false;
+    fclose(file);
+    return true;
+}
+
+static uint64_t round_up(uint64_t length, uint64_t page) {
+    return (length + page - 1) / page * page;
+}
+
+static void reset_block(cmem_block *block, const cmem_registry *known, const char *name) {
+    block->length = 0;
+    block->page_size = NORMAL_PAGE;
+    block->node = NODE_LOCAL;
+    block->key = 0;
+    block->zero = 0;
+    block->attach_address = 0;
+    block->creator_address = 0;
+    block->pid = getpid();
+    memset(block->counters, 0, sizeof block->counters);
+    block->diagnostic = 0;
+    block->configured = 0;
+    strlcpy(block->name, name, sizeof block->name);
+    strlcpy(block->owner, program_invocation_short_name, sizeof block->owner);
+    for (const cmem_conf &entry : known->conf)
+        if (entry.name[0] && strncmp(entry.name, block->name, NAME_BYTES) == 0) {
+            block->page_size = entry.page_size;
+            block->node = entry.node;
+            block->key = entry.key;
+            block->attach_address = entry.attach_address;
+            block->configured = 1;
+            break;
+        }
+}
+
+// The record to use for a name: a new one, or the one of a creator that has gone.
+static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t length) {
+    cmem_block *block = find_block(known, name);
+    if (!block) {
+        block = claim_block(known);
+        if (!block)
+            CMEM_LOG(LC_LOG_ERR, "%s: out of memory tracking blocks\n", "cmem_create_block");
+        return block;
+    }
+    if (creator_lives(block)) {
+        CMEM_LOG(LC_LOG_ERR, "%s: double create attempt for memory block %s, old pid=%d, new pid=%d\n",
+                 "cmem_create_block", name, block->pid, static_cast<int>(getpid()));
+        return nullptr;
+    }
+    const uint64_t rounded = round_up(length, block->page_size ? block->page_size : NORMAL_PAGE);
+    if (rounded != block->length) {
+        CMEM_LOG(LC_LOG_NOTICE, "%s: length change attempt for memory block %s, old len=%lu, new len=%lu\n",
+                 "cmem_create_block", name, static_cast<unsigned long>(block->length),
+                 static_cast<unsigned long>(rounded));
+        return nullptr;
+    }
+    return block;
+}
+
+static void place_on_node(void *memory, const cmem_block *block) {
+    if (numa_available() < 0)
+        return;
+    if (block->node >= 0)
+        numa_tonode_memory(memory, block->length, block->node);
+    else if (block->node == NODE_LOCAL)
+        numa_setlocal_memory(memory, block->length);
+    else
+        numa_interleave_memory(memory, block->length, numa_all_nodes_ptr);
+}
+
+void *cmem_create_block(uint64_t length, const char *name) {
+    const cancel_off_guard uncancelled;
+    cmem_registry *known = attach_registry();
+    cmem_block *block = take_block(known, name, length);
+    if (!block)
+        return nullptr;
+    reset_block(block, known, name);
+    if (block->key == 0) {
+        CMEM_LOG(LC_LOG_ERR, "%s: attempt to create shared block %s conflicts with conf file\n", __func__,
+                 name);
+        free_block(block);
+        return nullptr;
+    }
+    block->length = round_up(length, block->page_size);
+    const int key = static_cast<int>(block->key);
+    int id = shmget(key, 0, 0);
+    const bool fresh = id < 0;
+    if (fresh)
+        id = shmget(key, block->length,
+                    IPC_CREAT | SHARED_MODE | (block->page_size > NORMAL_PAGE ? SHM_HUGETLB : 0));
+    else if (segment_bytes(id) < length) {
+        errno = EINVAL;
+        id = -1;
+    }
+    if (id < 0) {
+        CMEM_LOG(
+            LC_LOG_ERR,
+            "%s: cannot attach/shmget shared block %s, length=%ld, key=%x, pagesize=%ld, shmid=%d, err=%s, "
+            "errno=%d, check SHMMAX\n",
+            __func__, name, static_cast<long>(block->length), block->key, static_cast<long>(block->page_size),
+            id, strerror(errno), errno);
+        free_block(block);
+        return nullptr;
+    }
+    void *memory = shmat(id, reinterpret_cast<const void *>(block->attach_address), 0);
+    if (memory == reinterpret_cast<void *>(-1)) {
+        CMEM_LOG(LC_LOG_ERR, "%s: cannot attach/shmat shared block %s, length=%ld, shmid=%d, err=%s\n",
+                 __func__, name, static_cast<long>(block->length), id, strerror(errno));
+        free_block(block);
+        return nullptr;
+    }
+    block->creator_address = reinterpret_cast<uint64_t>(memory);
+    if (fresh)
+        place_on_node(memory, block);
+    const uint64_t held = segment_bytes(id);
+    memset(memory, 0, held < block->length ? held : block->length);
+    return memory;
+}
+
+int cmem_exists_block(const char *name) {
+    const cancel_off_guard uncancelled;
+    cmem_registry *known = nullptr;
+    {
+        const mutex_guard guard(&registry_lock);
+        known = registry;
+    }
+    if (!known) {
+        // Looks on without making a registry: a process that only asks sees none until somebody has made it.
+        const int id = shmget(CMEM_REGISTRY_KEY, 0, 0);
+        if (id < 0 || segment_bytes(id) < sizeof(cmem_registry))
+            return 0;
+        known = attach_registry();
+    }
+    const cmem_block *block = find_block(known, name);
+    if (!block)
+        return 0;
+    if (shmget(static_cast<int>(block->key), 0, 0) < 0) {
+        CMEM_LOG(LC_LOG_ERR, "%s: cannot shmget to shared block %s, err=%s\n", __func__, name,
+                 strerror(errno));
+        return 0;
+    }
+    return 1;
+}
+
+void *cmem_attach_block(const char *name, uint64_t *out_length) {
+    const cancel_off_guard uncancelled;
+    if (out_length)
+        *out_length = 0;
+    cmem_registry *known = attach_registry();
+    const cmem_block *block = find_block(known, name);
+    if (!block) {
+        CMEM_LOG(LC_LOG_WARNING, "%s: memory block %s not found\n", __func__, name);
+        return nullptr;
+    }
+    if (block->key == 0) {
+        CMEM_LOG(LC_LOG_ERR, "%s: memory block %s is not shared\n", __func__, name);
+        return nullptr;
+    }
+    const int id = shmget(static_cast<int>(block->key), 0, 0);
+    if (id < 0) {
+        CMEM_LOG(LC_LOG_WARNING, "%s: cannot shmget shared block %s, key=%u, err=%s\n", __func__, name,
+                 block->key, strerror(errno));
+        return nullptr;
+    }
+    const void *address = reinterpret_cast<const void *>(block->attach_address);
+    void *memory = shmat(id, address, 0);
+    if (memory == reinterpret_cast<void *>(-1)) {
+        CMEM_LOG(LC_LOG_WARNING,
+                 "%s: cannot attach to shared block %s, err=%s, shmid=%x, p->addr=%p, shmflag=%x\n", __func__,
+                 name, strerror(errno), static_cast<unsigned>(id), address, 0U);
+        return nullptr;
+    }
+    if (out_length)
+        *out_length = segment_bytes(id);
+    return memory;
+}
+
+// --- Mutexes
+// --------------------------------------------------------------------------------------------------------
+
+struct cmutex {
+    char name[NAME_BYTES];
+    pthread_mutex_t mutex;
+};
+
+cmutex *cmutex_alloc(const char *name) {
+    cmutex *mutex = static_cast<cmutex *>(calloc(1, sizeof *mutex));
+    if (!mutex)
+        return nullptr;
+    strlcpy(mutex->name, name ? name : "", sizeof mutex->name);
+    pthread_mutex_init(&mutex->mutex, nullptr);
+    return mutex;
+}
+void cmutex_free(cmutex **inout_mutex) {
+    if (!inout_mutex || !*inout_mutex)
+        return;
+    pthread_mutex_destroy(&(*inout_mutex)->mutex);
+    free(*inout_mutex);
+    *inout_mutex = nullptr;
+}
+int cmutex_lock(cmutex *mutex) {
+    return mutex ? pthread_mutex_lock(&mutex->mutex) : EINVAL;
+}
+int cmutex_unlock(cmutex *mutex) {
+    return mutex ? pthread_mutex_unlock(&mutex->mutex) : EINVAL;
+}
