@@ -72,16 +72,21 @@ platform_limits platform_limits_read(const char *path) {
             QV_LOG(LC_LOG_WARNING, "%s: cannot be read (%m), defaults taken", path);
         return limits;
     }
-    char line[128];
-    for (unsigned number = 1; fgets(line, sizeof line, file); number++) {
-        const bool whole_line = strchr(line, '\n') != nullptr || feof(file);
-        if (!whole_line) { // the rest of a line that is longer than any good one
-            int c;
-            while ((c = fgetc(file)) != EOF && c != '\n')
-                ;
+    bool more = true;
+    for (unsigned number = 1; more; number++) {
+        char line[128];
+        size_t length = 0;
+        bool good = true; // neither longer than any good line nor with a NUL inside
+        int c;
+        while ((c = fgetc(file)) != EOF && c != '\n') {
+            good = good && c != '\0' && length + 1 < sizeof line;
+            if (good)
+                line[length++] = static_cast<char>(c);
         }
-        line[strcspn(line, "\r\n")] = '\0';
-        if ((!whole_line && *skip_blanks(line) != '#') || !take_line(line, &limits))
+        more = c != EOF;
+        line[length] = '\0';
+        line[strcspn(line, "\r")] = '\0';
+        if ((!good && *skip_blanks(line) != '#') || !take_line(line, &limits))
             QV_LOG(LC_LOG_WARNING, "%s: bad line %u passed over: %s", path, number, line);
     }
     fclose(file);
