@@ -5,6 +5,7 @@
 #include <cstdint>
 
 #include "runtime/common.h"
+#include "runtime/typed_arrays.h"
 
 // Why an interest function is called.
 enum : uint32_t {
@@ -35,12 +36,7 @@ struct fdic_event {
     void *timer_argument;
 };
 
-// Sorted by id. Freed by whoever asked for it.
-struct fdic_event_array;
-lc_status fdic_event_array_free(fdic_event_array **inout);
-uint32_t fdic_event_array_length_quick(const fdic_event_array *array);
-fdic_event *fdic_event_array_get_quick(const fdic_event_array *array, uint32_t index);
-lc_status fdic_event_array_duplicate(const fdic_event_array *array, fdic_event_array **out);
+// fdic_event_array (typed_arrays.h): sorted by id, an equal one is replaced. Freed by whoever asked for it.
 
 // The changes stay the list's; they are freed when the callback returns.
 using fdic_change_callback = lc_status (*)(const fdic_event_array *changes, void *user_data);

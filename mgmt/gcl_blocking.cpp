@@ -1,0 +1,216 @@
+// The opening of a service while the caller waits: a loop over this instance's interests alone, used before
+// the session is in general use. Both locks are held all the time, the wait included.
+//
+// The interests of a round are a copy, and a callback may take away what a later entry of the copy stands
+// for. That does no harm: their functions look at the session, which outlives its interests.
+#include <cerrno>
+#include <cstdlib>
+
+#include <poll.h>
+
+#include "mgmt/gcl_records.h"
+#include "runtime/logging.h"
+#include "runtime/ttime.h"
+
+constexpr int FD_MAX = 0x1ffff;
+
+// What a caller can wait for a change of.
+struct gcl_watched {
+    uint64_t frames_sent, frames_received;
+    int32_t session_state, protocol_state;
+};
+struct gcl_wait {
+    gcl *instance;
+    gcl_session *session;
+    bool on_sent, on_received, on_session_state, on_protocol_state;
+    uint16_t protocol;
+    int64_t timeout_ms, started_ms; // negative timeout: no limit
+    uint32_t timers_told;           // timers up to this id have had their call
+};
+
+static void free_polled(pollfd *polled) {
+    free(polled);
+}
+
+static gcl_watched look(const gcl_wait *wait) {
+    gcl_watched seen{wait->session->counters.frames_sent, wait->session->counters.frames_received,
+                     wait->session->state, 0};
+    gcl_body_protocol *protocol = gcl_get_body_protocol(wait->instance, wait->protocol);
+    if (protocol && protocol->query_session_state && wait->session->protocol_state[wait->protocol])
+        LOG_STATUS(protocol->query_session_state(wait->session, protocol, &seen.protocol_state));
+    return seen;
+}
+
+static bool changed(const gcl_wait *wait, const gcl_watched *before) {
+    const gcl_watched now = look(wait);
+    const bool differs = (wait->on_sent && now.frames_sent != before->frames_sent) ||
+                         (wait->on_received && now.frames_received != before->frames_received) ||
+                         (wait->on_session_state && now.session_state != before->session_state) ||
+                         (wait->on_protocol_state && now.protocol_state != before->protocol_state);
+    if (differs)
+        LC_LOG(LC_LOG_DEBUG, "CHANGE DETECTED");
+    return differs;
+}
+
+// Milliseconds left, -1 for no limit, -2 when time is up.
+static int64_t time_left(gcl_wait *wait) {
+    if (wait->timeout_ms < 0)
+        return -1;
+    const int64_t now = lt_curr_time_ms();
+    if (now < wait->started_ms)
+        wait->started_ms = now;
+    const int64_t left = wait->timeout_ms - (now - wait->started_ms);
+    return left < 0 ? -2 : left;
+}
+
+// Calls the timers that are due, each once in a wait, and gives the time to the next one (-1: none).
+static lc_status run_timers(gcl_wait *wait, const fdic_event_array *events, int64_t *out_next) {
+    const int64_t passed = lt_curr_time_ms() - wait->started_ms;
+    *out_next = -1;
+    for (uint32_t i = 0; i < fdic_event_array_length_quick(events); i++) {
+        const fdic_event *event = fdic_event_array_get_quick(events, i);
+        if (!event->has_timer || event->delay < 0 || event->id <= wait->timers_told)
+            continue;
+        if (event->delay > passed) {
+            const int64_t left = event->delay - passed;
+            *out_next = *out_next < 0 || left < *out_next ? left : *out_next;
+            continue;
+        }
+        wait->timers_told = event->id;
+        LC_LOG(LC_LOG_INFO, "GCL timeout forced");
+        CHECK_STATUS(
+            event->timer_function(event->fd, FDIC_TIMER_EXPIRED, event->user_data, event->timer_argument));
+    }
+    return LC_OK;
+}
+
+static lc_status fill_polled(const fdic_event_array *events, pollfd *polled) {
+    for (uint32_t i = 0; i < fdic_event_array_length_quick(events); i++) {
+        const fdic_event *event = fdic_event_array_get_quick(events, i);
+        polled[i] = {-1, 0, 0};
+        if (!event->has_fd || (!event->want_read && !event->want_write))
+            continue;
+        if (event->fd > FD_MAX) {
+            LC_LOG(LC_LOG_ERR, "fd too large: %d", event->fd);
+            return LC_GENERIC;
+        }
+        polled[i].fd = event->fd;
+        polled[i].events =
+            static_cast<short>((event->want_read ? POLLIN : 0) | (event->want_write ? POLLOUT : 0));
+    }
+    return LC_OK;
+}
+
+// Calls what is ready; `out_stop` when what the caller waits for has changed.
+static lc_status run_ready(const gcl_wait *wait, const fdic_event_array *events, const pollfd *polled,
+                           const gcl_watched *before, bool *out_stop) {
+    constexpr short broken = POLLERR | POLLHUP | POLLNVAL;
+    for (uint32_t i = 0; i < fdic_event_array_length_quick(events) && !*out_stop; i++) {
+        const fdic_event *event = fdic_event_array_get_quick(events, i);
+        const bool readable = polled[i].revents & (POLLIN | broken);
+        const bool writable = polled[i].revents & (POLLOUT | broken);
+        if (readable && event->want_read && event->read_function)
+            CHECK_STATUS(
+                event->read_function(event->fd, FDIC_READABLE, event->user_data, event->read_argument));
+        if (readable && event->user_data == wait->session)
+            *out_stop = changed(wait, before);
+        if (*out_stop)
+            return LC_OK;
+        if (writable && event->want_write && event->write_function)
+            CHECK_STATUS(
+                event->write_function(event->fd, FDIC_WRITABLE, event->user_data, event->write_argument));
+        if (writable && event->user_data == wait->session)
+            *out_stop = changed(wait, before);
+    }
+    return LC_OK;
+}
+
+static lc_status wait_round(gcl_wait *wait, bool *out_stop) {
+    if (wait->session->state == GCL_SESSION_CLOSED || wait->session->fd < 0)
+        return LC_IO_CLOSED;
+    owned<fdic_event_array, fdic_event_array_release> events;
+    CHECK_STATUS(fdic_events_query(wait->instance->interests, &events.pointer));
+    const gcl_watched before = look(wait);
+    int64_t next_timer = -1;
+    CHECK_STATUS(run_timers(wait, events.pointer, &next_timer));
+    const uint32_t count = fdic_event_array_length_quick(events.pointer);
+    owned<pollfd, free_polled> polled(static_cast<pollfd *>(calloc(count + 1, sizeof(pollfd))));
+    CHECK_NULL(polled.pointer);
+    CHECK_QUIET(fill_polled(events.pointer, polled.pointer));
+    const int64_t left = time_left(wait);
+    if (left < -1)
+        return LC_IO_TIMED_OUT;
+    const bool for_timer = next_timer >= 0 && (left < 0 || next_timer < left);
+    const int64_t limit = for_timer ? next_timer : left;
+    const int ready = poll(polled.pointer, count, static_cast<int>(limit > INT32_MAX ? INT32_MAX : limit));
+    if (ready == 0)
+        return for_timer ? LC_OK : LC_IO_TIMED_OUT;
+    if (ready < 0 && errno == EINTR)
+        return LC_OK;
+    if (ready < 0 && errno == EBADF)
+        return LC_IO_CLOSED;
+    if (ready < 0) {
+        LC_LOG(LC_LOG_ERR, "poll: %m");
+        return LC_GENERIC;
+    }
+    return run_ready(wait, events.pointer, polled.pointer, &before, out_stop);
+}
+
+lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int stop_on_frames_sent,
+                                     int stop_on_frames_received, int stop_on_session_state,
+                                     int stop_on_protocol_state, uint16_t protocol, int64_t timeout_ms) {
+    CHECK_NULL(instance);
+    CHECK_NULL(session);
+    const gcl_session_guard guard(session);
+    gcl_wait wait{};
+    wait.instance = instance;
+    wait.session = session;
+    wait.on_sent = stop_on_frames_sent;
+    wait.on_received = stop_on_frames_received;
+    wait.on_session_state = stop_on_session_state;
+    wait.on_protocol_state = stop_on_protocol_state;
+    wait.protocol = protocol;
+    wait.timeout_ms = timeout_ms;
+    wait.started_ms = lt_curr_time_ms();
+    bool stop = false;
+    while (!stop)
+        CHECK_QUIET(wait_round(&wait, &stop));
+    return LC_OK;
+}
+
+// One wait of the opening. A peer that closes or never answers is an ordinary event; a closed one ends the
+// session.
+static lc_status wait_for_peer(gcl_session *session, int on_received, uint16_t protocol, int64_t timeout_ms) {
+    const lc_status status =
+        gcl_session_do_blocking_io(session->instance, session, 0, on_received, 1, 1, protocol, timeout_ms);
+    if (status == LC_IO_TIMED_OUT)
+        CHECK_QUIET(status);
+    if (status == LC_IO_CLOSED) {
+        LOG_STATUS(gcl_session_close(session, 0));
+        CHECK_QUIET(status);
+    }
+    CHECK_STATUS(status);
+    return LC_OK;
+}
+
+lc_status gcl_session_client_open_service_blocking(gcl_session *session, uint16_t protocol, int32_t service,
+                                                   const char *name, int32_t reserved, int64_t timeout_ms) {
+    CHECK_NULL(session);
+    const gcl_session_guard guard(session);
+    const gcl_admin *admin = gcl_admin_of(session);
+    CHECK_NULL(admin);
+    while (admin->state != GCL_ADMIN_GREETED && admin->state != GCL_ADMIN_OPEN_ANSWERED) {
+        CHECK_QUIET(wait_for_peer(session, 0, GCL_PROTO_ADMIN, timeout_ms));
+        if (admin->state != GCL_ADMIN_GREETING_AWAITED && admin->state != GCL_ADMIN_GREETED)
+            return LC_GENERIC;
+    }
+    CHECK_STATUS(gcl_session_client_open_service(session, protocol, service, name, reserved));
+    // A refusal while another service is open leaves the state of the greeting, with nothing pending.
+    while (admin->state != GCL_ADMIN_OPEN_ANSWERED && admin->pending_service) {
+        CHECK_QUIET(wait_for_peer(session, 1, protocol, timeout_ms));
+        if (admin->state < GCL_ADMIN_GREETING_AWAITED || admin->state > GCL_ADMIN_OPEN_ANSWERED ||
+            admin->state == GCL_ADMIN_GREETING_SENT)
+            return LC_GENERIC;
+    }
+    return gcl_session_service_is_open(session, service) ? LC_OK : LC_GENERIC;
+}

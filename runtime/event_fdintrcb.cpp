@@ -1,0 +1,254 @@
+// The bridge: carries changes of an interest list into a loop and calls the interest's function when
+// something fires. It holds an entry for each active interest: the loop's event and a copy of the interest's
+// record.
+//
+// Entries belong to the loop's thread. A change that another thread makes (a sender that finds its socket
+// full, empty again, or closed by the peer) is copied and posted to the loop; entries, loop events and the
+// open and close handlers are dealt with there, before the loop runs its next callback and in the order of
+// the changes. The poster waits for nothing, so it may hold the locks that a callback of the loop wants, and
+// an entry never goes while the loop's thread stands in its handler. On its own thread a change is carried
+// out at once, behind what is posted.
+//
+// A handler works on a copy of its entry all the same: the interest's function may take its own interest
+// away.
+#include "runtime/event_fdintrcb.h"
+
+#include <cstdlib>
+#include <cstring>
+
+#include "runtime/guards.h"
+#include "runtime/hash_table.h"
+#include "runtime/logging.h"
+
+struct fdic_libevent_entry {
+    loop_context *loop;
+    loop_event *event;
+    fdic_event interest;
+};
+
+struct fdic_libevent {
+    loop_context *loop;
+    ht *entries; // by interest id
+    fdic_handler close_handler;
+    void *close_data;
+    fdic_handler open_handler;
+    void *open_data;
+};
+
+struct posted_changes {
+    loop_post post; // first, so that the record can be found again
+    fdic_libevent *bridge;
+    fdic_event_array *changes;
+};
+
+static lc_status fdic_libevent_record_free(void *key, uint32_t, void *value, void *) {
+    auto *entry = static_cast<fdic_libevent_entry *>(value);
+    loop_event_free(&entry->event);
+    free(entry);
+    free(key);
+    return LC_OK;
+}
+
+lc_status fdic_libevent_init(loop_context *loop, fdic_libevent **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(loop);
+    auto *bridge = static_cast<fdic_libevent *>(calloc(1, sizeof(fdic_libevent)));
+    CHECK_NULL(bridge);
+    bridge->loop = loop;
+    ht_options options;
+    ht_default_options(&options);
+    options.free_function = fdic_libevent_record_free;
+    const lc_status status = ht_new(&bridge->entries, &options);
+    if (status != LC_OK)
+        free(bridge);
+    CHECK_STATUS(status);
+    *out = bridge;
+    return LC_OK;
+}
+
+lc_status fdic_libevent_deinit(fdic_libevent **inout) {
+    CHECK_NULL(inout);
+    fdic_libevent *bridge = *inout;
+    *inout = nullptr;
+    if (!bridge)
+        return LC_OK;
+    loop_withdraw_posted(bridge->loop, bridge);
+    LOG_STATUS(ht_free(&bridge->entries));
+    free(bridge);
+    return LC_OK;
+}
+
+lc_status fdic_libevent_set_fd_close_handler(fdic_libevent *bridge, fdic_handler function, void *user_data) {
+    CHECK_NULL(bridge);
+    bridge->close_handler = function;
+    bridge->close_data = user_data;
+    return LC_OK;
+}
+lc_status fdic_libevent_set_fd_open_handler(fdic_libevent *bridge, fdic_handler function, void *user_data) {
+    CHECK_NULL(bridge);
+    bridge->open_handler = function;
+    bridge->open_data = user_data;
+    return LC_OK;
+}
+
+static fdic_libevent_entry *find_entry(const fdic_libevent *bridge, uint32_t id) {
+    void *value = nullptr;
+    int found = 0;
+    LOG_STATUS(ht_lookup(bridge->entries, &id, sizeof id, &found, nullptr, nullptr, &value));
+    return found ? static_cast<fdic_libevent_entry *>(value) : nullptr;
+}
+
+// ---- From the loop
+
+static lc_status read_fired(int fd, const fdic_libevent_entry *entry) {
+    const fdic_event *interest = &entry->interest;
+    CHECK_CONDITION(interest->fd == fd);
+    if (interest->has_fd && interest->want_read)
+        CHECK_STATUS(
+            interest->read_function(fd, FDIC_READABLE, interest->user_data, interest->read_argument));
+    return LC_OK;
+}
+static lc_status write_fired(int fd, const fdic_libevent_entry *entry) {
+    const fdic_event *interest = &entry->interest;
+    CHECK_CONDITION(interest->fd == fd);
+    if (interest->has_fd && interest->want_write)
+        CHECK_STATUS(
+            interest->write_function(fd, FDIC_WRITABLE, interest->user_data, interest->write_argument));
+    return LC_OK;
+}
+static lc_status timer_fired(int fd, const fdic_libevent_entry *entry) {
+    const fdic_event *interest = &entry->interest;
+    CHECK_CONDITION(interest->has_timer);
+    CHECK_STATUS(
+        interest->timer_function(fd, FDIC_TIMER_EXPIRED, interest->user_data, interest->timer_argument));
+    return LC_OK;
+}
+
+static lc_status run_fired(int fd, short flags, const fdic_libevent_entry *entry) {
+    if (flags & LOOP_READ)
+        CHECK_QUIET(read_fired(fd, entry));
+    if (flags & LOOP_WRITE)
+        CHECK_QUIET(write_fired(fd, entry));
+    if (flags & LOOP_TIMEOUT)
+        CHECK_QUIET(timer_fired(fd, entry));
+    return LC_OK;
+}
+
+static void fdic_libevent_handler(int fd, short flags, void *data) {
+    auto *real = static_cast<fdic_libevent_entry *>(data);
+    const fdic_libevent_entry entry = *real;
+    if (flags & LOOP_SIGNAL) {
+        LC_LOG(LC_LOG_WARNING, "Received unexpected signal %d (%s); unregistering event", fd,
+               lc_signal_num_to_name(fd));
+        loop_event_remove(real->event);
+        return;
+    }
+    if (!(flags & (LOOP_READ | LOOP_WRITE | LOOP_TIMEOUT)))
+        LC_LOG(LC_LOG_WARNING, "Called with event_type %d", flags);
+    (void)run_fired(fd, flags, &entry);
+}
+
+// ---- Into the loop
+
+static lc_status drop_interest(fdic_libevent *bridge, const fdic_event *change) {
+    fdic_libevent_entry *entry = find_entry(bridge, change->id);
+    if (!entry)
+        return LC_OK;
+    const bool told = entry->interest.has_fd && bridge->close_handler;
+    const int fd = entry->interest.fd;
+    void *user_data = entry->interest.user_data;
+    LOG_STATUS(ht_delete(bridge->entries, &change->id, sizeof change->id));
+    if (told)
+        CHECK_STATUS(bridge->close_handler(fd, FDIC_FD_CLOSED, user_data, bridge->close_data));
+    return LC_OK;
+}
+
+static void free_entry(fdic_libevent_entry *entry) {
+    loop_event_free(&entry->event);
+    free(entry);
+}
+
+static lc_status make_entry(fdic_libevent *bridge, uint32_t id, fdic_libevent_entry **out) {
+    owned<fdic_libevent_entry, free_entry> entry(
+        static_cast<fdic_libevent_entry *>(calloc(1, sizeof(fdic_libevent_entry))));
+    CHECK_NULL(entry.pointer);
+    entry.pointer->loop = bridge->loop;
+    CHECK_STATUS(loop_event_new(bridge->loop, fdic_libevent_handler, entry.pointer, &entry.pointer->event));
+    owned_text key(static_cast<char *>(malloc(sizeof id)));
+    CHECK_NULL(key.pointer);
+    memcpy(key.pointer, &id, sizeof id);
+    CHECK_STATUS(ht_insert(bridge->entries, key.pointer, sizeof id, entry.pointer));
+    key.take();
+    *out = entry.take();
+    return LC_OK;
+}
+
+static lc_status take_interest(fdic_libevent *bridge, const fdic_event *change) {
+    if (!find_entry(bridge, change->id)) {
+        fdic_libevent_entry *made = nullptr;
+        CHECK_STATUS(make_entry(bridge, change->id, &made));
+        made->interest = *change;
+        if (change->has_fd && bridge->open_handler)
+            CHECK_STATUS(
+                bridge->open_handler(change->fd, FDIC_FD_OPENED, change->user_data, bridge->open_data));
+    }
+    fdic_libevent_entry *entry = find_entry(bridge, change->id);
+    if (!entry)
+        return LC_OK; // the handler took it away again
+    entry->interest = *change;
+    loop_event_remove(entry->event);
+    if (change->has_fd) {
+        const int flags = (change->want_read ? LOOP_READ : 0) | (change->want_write ? LOOP_WRITE : 0);
+        CHECK_STATUS(loop_event_set_fd(entry->event, change->fd, static_cast<short>(flags)));
+    } else if (change->has_timer && change->delay >= 0) {
+        CHECK_STATUS(loop_event_set_timer(entry->event, change->delay));
+    }
+    return LC_OK;
+}
+
+static lc_status carry_out(fdic_libevent *bridge, const fdic_event_array *changes) {
+    lc_status result = LC_OK;
+    for (uint32_t i = 0; i < fdic_event_array_length_quick(changes); i++) {
+        const fdic_event *change = fdic_event_array_get_quick(changes, i);
+        const lc_status status =
+            change->active ? take_interest(bridge, change) : drop_interest(bridge, change);
+        LOG_STATUS(status);
+        result = result ? result : status;
+    }
+    return result;
+}
+
+static void carry_out_posted(loop_post *post, int carry) {
+    auto *posted = reinterpret_cast<posted_changes *>(post);
+    if (carry)
+        (void)carry_out(posted->bridge, posted->changes);
+    (void)fdic_event_array_free(&posted->changes);
+    free(posted);
+}
+
+static lc_status post_changes(fdic_libevent *bridge, const fdic_event_array *changes) {
+    auto *posted = static_cast<posted_changes *>(calloc(1, sizeof(posted_changes)));
+    CHECK_NULL(posted);
+    const lc_status status = fdic_event_array_duplicate(changes, &posted->changes);
+    if (status != LC_OK)
+        free(posted);
+    CHECK_STATUS(status);
+    posted->post.poster = bridge;
+    posted->post.function = carry_out_posted;
+    posted->bridge = bridge;
+    loop_post_work(bridge->loop, &posted->post);
+    return LC_OK;
+}
+
+lc_status fdic_libevent_callback(const fdic_event_array *changes, void *data) {
+    CHECK_NULL(changes);
+    CHECK_NULL(data);
+    auto *bridge = static_cast<fdic_libevent *>(data);
+    if (!loop_is_own_thread(bridge->loop)) {
+        CHECK_STATUS(post_changes(bridge, changes));
+        return LC_OK;
+    }
+    loop_run_posted(bridge->loop);
+    return carry_out(bridge, changes);
+}

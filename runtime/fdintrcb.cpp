@@ -1,0 +1,257 @@
+// Interest lists. A list holds what is wanted now and what the change callback has been told; each operation
+// changes the first and then compares the two, and what differs goes to the callback. The callback runs last,
+// when both arrays are whole again, so it may change the list in its turn.
+//
+// No lock and no thread of its own: whoever uses a list guards it, as a session's instance does with its
+// lock.
+#include "runtime/fdintrcb.h"
+
+#include <cstdlib>
+#include <cstring>
+
+#include "runtime/guards.h"
+#include "runtime/logging.h"
+
+struct fdic {
+    uint32_t next_id;
+    fdic_change_callback callback;
+    void *user_data;
+    fdic_event_array *current;
+    fdic_event_array *reported;
+};
+
+static int compare_ids(const void *a, const void *b) {
+    const uint32_t first = (*static_cast<fdic_event *const *>(a))->id;
+    const uint32_t second = (*static_cast<fdic_event *const *>(b))->id;
+    return first < second ? -1 : first > second;
+}
+static lc_status fdic_event_dup_for_array(const void *element, void **out_copy) {
+    *out_copy = malloc(sizeof(fdic_event));
+    CHECK_NULL(*out_copy);
+    memcpy(*out_copy, element, sizeof(fdic_event));
+    return LC_OK;
+}
+static void fill_options(array_options *options) {
+    options->compare = compare_ids;
+    options->duplicate = fdic_event_dup_for_array;
+    options->free = free;
+    options->duplicate_policy = array_dup_replace;
+}
+TYPED_ARRAY_DEFINE(fdic_event_array, fdic_event *, fill_options)
+
+using owned_events = owned<fdic_event_array, fdic_event_array_release>;
+
+lc_status fdic_init(fdic **out, fdic_change_callback callback, void *user_data) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    auto *context = static_cast<fdic *>(calloc(1, sizeof(fdic)));
+    CHECK_NULL(context);
+    context->next_id = 1;
+    context->callback = callback;
+    context->user_data = user_data;
+    lc_status status = fdic_event_array_new(&context->current);
+    if (status == LC_OK)
+        status = fdic_event_array_new(&context->reported);
+    if (status != LC_OK)
+        (void)fdic_deinit(&context);
+    CHECK_STATUS(status);
+    *out = context;
+    return LC_OK;
+}
+
+lc_status fdic_deinit(fdic **inout) {
+    CHECK_NULL(inout);
+    fdic *context = *inout;
+    *inout = nullptr;
+    if (!context)
+        return LC_OK;
+    LOG_STATUS(fdic_event_array_free(&context->current));
+    LOG_STATUS(fdic_event_array_free(&context->reported));
+    free(context);
+    return LC_OK;
+}
+
+static fdic_event *find(const fdic_event_array *events, uint32_t id, uint32_t *out_index) {
+    fdic_event key{};
+    key.id = id;
+    if (fdic_event_array_binary_search(events, &key, out_index) != LC_OK)
+        return nullptr;
+    return fdic_event_array_get_quick(events, *out_index);
+}
+
+// ---- The compare step
+
+static bool is_usable(const fdic_event *event) {
+    return (event->has_fd && event->fd >= 0) || (event->has_timer && event->delay >= 0);
+}
+
+static bool is_told(const fdic_event *event, const fdic_event *reported) {
+    if (!reported)
+        return !event->active; // came and went untold
+    if (event->active != reported->active || event->has_fd != reported->has_fd ||
+        event->has_timer != reported->has_timer)
+        return false;
+    if (event->has_fd && (event->fd != reported->fd || event->want_read != reported->want_read ||
+                          event->want_write != reported->want_write))
+        return false;
+    return !event->has_timer || event->delay == reported->delay;
+}
+
+static lc_status report(fdic *context, const fdic_event *event) {
+    uint32_t index = 0;
+    if (event->active) {
+        CHECK_STATUS(fdic_event_array_insert_sorted(context->reported, event));
+    } else if (find(context->reported, event->id, &index)) {
+        CHECK_STATUS(fdic_event_array_delete(context->reported, index));
+    }
+    return LC_OK;
+}
+
+static lc_status compare(fdic *context, bool all, fdic_event_array **out) {
+    owned_events result;
+    CHECK_STATUS(fdic_event_array_new(&result.pointer));
+    const uint32_t count = fdic_event_array_length_quick(context->current);
+    for (uint32_t i = 0; i < count; i++) {
+        fdic_event *event = fdic_event_array_get_quick(context->current, i);
+        uint32_t index = 0;
+        const fdic_event *reported = find(context->reported, event->id, &index);
+        if (!is_usable(event))
+            event->active = 0;
+        if (!all && is_told(event, reported))
+            continue;
+        if (event->id == 0) {
+            LC_LOG(LC_LOG_ERR, "Invalid event for fd %d timeout %ld: 0 id", event->fd,
+                   static_cast<long>(event->delay));
+            continue;
+        }
+        CHECK_STATUS(report(context, event));
+        CHECK_STATUS(fdic_event_array_insert_sorted(result.pointer, event));
+    }
+    for (uint32_t i = count; i-- > 0;)
+        if (!fdic_event_array_get_quick(context->current, i)->active)
+            CHECK_STATUS(fdic_event_array_delete(context->current, i));
+    *out = result.take();
+    return LC_OK;
+}
+
+static lc_status tell_changes(fdic *context) {
+    owned_events changes;
+    CHECK_STATUS(compare(context, false, &changes.pointer));
+    if (fdic_event_array_length_quick(changes.pointer) && context->callback)
+        CHECK_STATUS(context->callback(changes.pointer, context->user_data));
+    return LC_OK;
+}
+
+// ---- Changes
+
+static lc_status add(fdic *context, fdic_event *event, int32_t *out_id) {
+    event->context = context;
+    event->id = context->next_id++;
+    CHECK_STATUS(fdic_event_array_insert_sorted(context->current, event));
+    *out_id = static_cast<int32_t>(event->id);
+    CHECK_STATUS(tell_changes(context));
+    return LC_OK;
+}
+
+lc_status fdic_event_add_fd(fdic *context, int32_t fd, int32_t want_read, int32_t want_write, void *user_data,
+                            fdic_handler read_function, void *read_argument, fdic_handler write_function,
+                            void *write_argument, int32_t *out_id) {
+    CHECK_NULL(out_id);
+    *out_id = -1;
+    CHECK_NULL(context);
+    fdic_event event{};
+    event.active = fd >= 0;
+    event.has_fd = 1;
+    event.fd = fd;
+    event.user_data = user_data;
+    event.want_read = want_read;
+    event.want_write = want_write;
+    event.read_function = read_function;
+    event.read_argument = read_argument;
+    event.write_function = write_function;
+    event.write_argument = write_argument;
+    event.delay = -1;
+    CHECK_STATUS(add(context, &event, out_id));
+    return LC_OK;
+}
+
+lc_status fdic_event_add_timer(fdic *context, int64_t delay_ms, void *user_data, fdic_handler timer_function,
+                               void *timer_argument, int32_t *out_id) {
+    CHECK_NULL(out_id);
+    *out_id = -1;
+    CHECK_NULL(context);
+    fdic_event event{};
+    event.active = 1;
+    event.fd = -1;
+    event.user_data = user_data;
+    event.has_timer = 1;
+    event.delay = delay_ms < 0 ? -1 : delay_ms;
+    event.timer_function = timer_function;
+    event.timer_argument = timer_argument;
+    LC_LOG(LC_LOG_INFO, "EVENT: adding for %p: %ld ms", user_data, static_cast<long>(event.delay));
+    CHECK_STATUS(add(context, &event, out_id));
+    return LC_OK;
+}
+
+static fdic_event *find_current(const fdic *context, int32_t id) {
+    uint32_t index = 0;
+    return id > 0 ? find(context->current, static_cast<uint32_t>(id), &index) : nullptr;
+}
+
+lc_status fdic_event_update_fd(fdic *context, int32_t id, int32_t want_read, int32_t want_write) {
+    CHECK_NULL(context);
+    fdic_event *event = find_current(context, id);
+    if (!event) {
+        LC_LOG(LC_LOG_WARNING, "Asked to update event fd with bad id %d", id);
+        return LC_NOT_FOUND;
+    }
+    event->want_read = want_read;
+    event->want_write = want_write;
+    CHECK_STATUS(tell_changes(context));
+    return LC_OK;
+}
+
+lc_status fdic_event_delete_fd(fdic *context, int32_t id) {
+    CHECK_NULL(context);
+    fdic_event *event = find_current(context, id);
+    if (!event) {
+        LC_LOG(LC_LOG_WARNING, "Asked to update event fd with bad id %d", id);
+        return LC_NOT_FOUND;
+    }
+    event->active = 0;
+    CHECK_STATUS(tell_changes(context));
+    return LC_OK;
+}
+
+lc_status fdic_event_update_timer(fdic *context, int32_t id, int64_t delay_ms) {
+    CHECK_NULL(context);
+    fdic_event *event = find_current(context, id);
+    if (!event) {
+        LC_LOG(LC_LOG_WARNING, "Asked to update event timer with bad id %d", id);
+        return LC_NOT_FOUND;
+    }
+    event->delay = delay_ms < 0 ? -1 : delay_ms;
+    CHECK_STATUS(tell_changes(context));
+    return LC_OK;
+}
+
+lc_status fdic_event_delete_timer(fdic *context, int32_t id) {
+    CHECK_NULL(context);
+    fdic_event *event = find_current(context, id);
+    if (!event) {
+        LC_LOG(LC_LOG_WARNING, "Asked to delete event timer with bad id %d", id);
+        return LC_NOT_FOUND;
+    }
+    LC_LOG(LC_LOG_INFO, "EVENT: deleting for %p: %ld ms", event->user_data, static_cast<long>(event->delay));
+    event->active = 0;
+    CHECK_STATUS(tell_changes(context));
+    return LC_OK;
+}
+
+lc_status fdic_events_query(fdic *context, fdic_event_array **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(context);
+    CHECK_STATUS(compare(context, true, out));
+    return LC_OK;
+}

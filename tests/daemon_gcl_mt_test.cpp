@@ -1,0 +1,226 @@
+// A session that engine threads send on while a loop of its own thread drives it, as alarms and state events
+// are sent. WCCP_STRESS=1 makes it the long form: a minute of sending, a thousand closings.
+#include <atomic>
+#include <cstdlib>
+#include <ctime>
+#include <map>
+#include <random>
+#include <thread>
+
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <pthread.h>
+#include <sys/ioctl.h>
+
+#include "tests/support/gcl_client.h"
+
+namespace {
+
+bool stress() {
+    const char *value = getenv("WCCP_STRESS");
+    return value && *value && *value != '0';
+}
+double now_seconds() {
+    timespec now{};
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+}
+
+// The alarm client: a thread that makes the session, opens it and runs its loop.
+struct session_thread {
+    gcl_client client;
+    std::atomic<int> ready{0}, ended{0}, acknowledged{0};
+    std::thread thread;
+    std::thread::id closed_on;
+
+    void run() {
+        client.start();
+        client.on_frame = [this](const wire &) {
+            acknowledged++;
+            return LC_OK;
+        };
+        client.on_close = [this] {
+            closed_on = std::this_thread::get_id();
+            EXPECT_EQ(lew_escape_from_dispatch(client.wrapper), LC_OK);
+        };
+        EXPECT_EQ(client.make(), LC_OK);
+        EXPECT_EQ(gcl_session_client_connect_by_provider(client.session, "mgmtd", 1), LC_OK);
+        EXPECT_EQ(client.open(-1), LC_OK);
+        ready = 1;
+        EXPECT_EQ(lew_dispatch(client.wrapper, nullptr, nullptr), LC_OK);
+        ended = 1;
+    }
+    void start() {
+        thread = std::thread([this] { run(); });
+        while (!ready)
+            usleep(500);
+    }
+};
+
+// An engine thread: it holds the engine's lock while it sends, and is cancelled at any moment and started
+// again.
+struct sender {
+    session_thread *to = nullptr;
+    pthread_mutex_t *engine = nullptr;
+    uint16_t number = 0;
+    pthread_t thread{};
+    std::atomic<uint32_t> next{0};
+    std::atomic<uint32_t> refused{0};
+    std::atomic<bool> stop{false};
+
+    static void *run(void *data) {
+        auto *self = static_cast<sender *>(data);
+        std::minstd_rand random(self->number);
+        while (!self->stop) {
+            {
+                const mutex_guard guard(self->engine);
+                const wire body =
+                    be(self->next, 4) + wire(random() % 4000, static_cast<char>('a' + self->number));
+                const lc_status status = self->to->client.send(self->number, body);
+                if (status == LC_OK)
+                    self->next++;
+                else
+                    self->refused++;
+            }
+            if (random() % 16 == 0)
+                usleep(50);
+            pthread_testcancel();
+        }
+        return nullptr;
+    }
+    void start() { ASSERT_EQ(pthread_create(&thread, nullptr, run, this), 0); }
+    void cancel() {
+        pthread_cancel(thread);
+        pthread_join(thread, nullptr);
+    }
+    void join() {
+        stop = true;
+        pthread_join(thread, nullptr);
+    }
+};
+
+// Every frame of every sender arrives whole, once and in its order, whatever the provider's pace.
+TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
+    gcl_provider provider;
+    ASSERT_TRUE(provider.listen_as("mgmtd"));
+    session_thread session;
+    std::thread opening([&] { EXPECT_TRUE(provider.open_session()); });
+    session.start();
+    opening.join();
+
+    pthread_mutex_t engine = PTHREAD_MUTEX_INITIALIZER;
+    sender senders[3];
+    for (uint16_t i = 0; i < 3; i++) {
+        senders[i].to = &session;
+        senders[i].engine = &engine;
+        senders[i].number = static_cast<uint16_t>(i + 1);
+        senders[i].start();
+    }
+    std::atomic<bool> over{false};
+    // Cancelled in mid-send again and again. A frame may have gone with its number not yet counted up; the
+    // sender's next life then sends that number again.
+    std::thread canceller([&] {
+        std::minstd_rand random(7);
+        while (!over) {
+            usleep(2000 + static_cast<useconds_t>(random() % 10000));
+            senders[2].cancel();
+            senders[2].start();
+        }
+    });
+
+    uint32_t expected[4] = {}, repeated = 0, frames = 0, acknowledged = 0, sequence = 2000003;
+    std::minstd_rand random(1);
+    const double end = now_seconds() + (stress() ? 60 : 3);
+    bool draining = false;
+    for (;;) {
+        if (!draining && now_seconds() > end) {
+            over = true;
+            canceller.join();
+            for (sender &each : senders)
+                each.join();
+            draining = true;
+        }
+        if (!draining && random() % 300 == 0)
+            usleep(static_cast<useconds_t>(random() % 60000)); // stops reading: the socket fills
+        const wire frame = provider.take_frame(draining ? 300 : 3000);
+        if (frame.empty()) {
+            ASSERT_TRUE(draining);
+            break;
+        }
+        const uint32_t who = number_at(frame, 26, 2);
+        ASSERT_EQ(number_at(frame, 20), sequence++);
+        ASSERT_TRUE(who >= 1 && who <= 3);
+        const uint32_t number = number_at(frame, 32);
+        if (who == 3 && number + 1 == expected[who])
+            repeated++;
+        else
+            ASSERT_EQ(number, expected[who]++) << who;
+        ASSERT_EQ(frame.find_first_not_of(static_cast<char>('a' + who), 36), wire::npos);
+        frames++;
+        if (random() % 200 == 0) { // a burst of acknowledgements
+            const auto burst = static_cast<uint32_t>(random() % 100);
+            wire bytes;
+            for (uint32_t i = 0; i < burst; i++)
+                bytes += frame_bytes(3, 1, wire(i, 'k'));
+            ASSERT_TRUE(provider.put(bytes));
+            acknowledged += burst;
+        }
+    }
+    for (uint16_t i = 1; i <= 3; i++)
+        EXPECT_LE(senders[i - 1].next, expected[i]);
+    EXPECT_EQ(senders[0].next, expected[1]);
+    EXPECT_EQ(senders[1].next, expected[2]);
+    EXPECT_GT(frames, 100u);
+    for (const double start = now_seconds();
+         session.acknowledged < static_cast<int>(acknowledged) && now_seconds() - start < 5;)
+        usleep(1000);
+    EXPECT_EQ(session.acknowledged, static_cast<int>(acknowledged));
+    EXPECT_FALSE(session.ended);
+    EXPECT_EQ(lew_escape_from_dispatch(session.client.wrapper), LC_OK);
+    session.thread.join();
+    session.client.finish();
+    printf("%u frames, %u acknowledgements, %u repeated after a cancellation\n", frames, acknowledged,
+           repeated);
+}
+
+// The provider closes at random moments, while the loop's thread reads and others send. The session ends on
+// its own thread, once, whoever found it; nobody hangs.
+TEST(GclThreads, AProviderThatClosesWhileOthersSend) {
+    gcl_provider provider;
+    ASSERT_TRUE(provider.listen_as("mgmtd"));
+    const int rounds = stress() ? 1000 : 60;
+    std::minstd_rand random(3);
+    for (int i = 0; i < rounds; i++) {
+        session_thread session;
+        std::thread opening([&] { EXPECT_TRUE(provider.open_session()); });
+        session.start();
+        opening.join();
+        pthread_mutex_t engine = PTHREAD_MUTEX_INITIALIZER;
+        sender senders[2];
+        for (uint16_t k = 0; k < 2; k++) {
+            senders[k].to = &session;
+            senders[k].engine = &engine;
+            senders[k].number = static_cast<uint16_t>(k + 1);
+            senders[k].start();
+        }
+        if (i % 2)
+            (void)provider.put(frame_bytes(3, 1, wire(static_cast<size_t>(random() % 3000), 'p')));
+        if (i % 3)
+            provider.take_frame();
+        usleep(static_cast<useconds_t>(random() % 4000));
+        provider.close_client();
+        for (const double start = now_seconds(); !session.ended && now_seconds() - start < 10;)
+            usleep(500);
+        ASSERT_TRUE(session.ended);
+        const std::thread::id own = session.thread.get_id();
+        session.thread.join();
+        for (sender &each : senders)
+            each.join();
+        EXPECT_EQ(session.client.closes, 1);
+        EXPECT_EQ(session.closed_on, own);
+        session.client.finish();
+        EXPECT_EQ(session.client.closes, 1);
+    }
+}
+
+} // namespace

@@ -1,0 +1,515 @@
+// Sessions against a provider made of raw bytes: the opening, the frame reader, the output queue.
+#include <atomic>
+#include <ctime>
+#include <mutex>
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "tests/support/gcl_client.h"
+#include "tests/support/gcl_log.h"
+
+namespace {
+
+double now_seconds() {
+    timespec now{};
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+}
+
+struct Gcl : testing::Test {
+    gcl_provider provider;
+    gcl_client client;
+    void SetUp() override {
+        ASSERT_TRUE(provider.listen_as("mgmtd"));
+        client.start();
+    }
+    void TearDown() override {
+        client.finish();
+        EXPECT_NE(access(own_path().c_str(), F_OK), 0);
+    }
+    static wire own_name() { return "wccpd-" + std::to_string(getpid()); }
+    static wire own_path() { return "/tmp/gcl-socks/uds-client-" + own_name(); }
+    void connect() {
+        ASSERT_EQ(client.make(), LC_OK);
+        ASSERT_EQ(gcl_session_client_connect_by_provider(client.session, "mgmtd", 0), LC_OK);
+    }
+    void open() {
+        connect();
+        std::thread other([&] { EXPECT_TRUE(provider.open_session()); });
+        EXPECT_EQ(client.open(), LC_OK);
+        other.join();
+    }
+    void round() { ASSERT_EQ(lew_dispatch_once(client.wrapper, nullptr, nullptr), LC_OK); }
+    void until(const std::function<bool()> &done) {
+        const double start = now_seconds();
+        while (!done() && now_seconds() - start < 5)
+            round();
+        ASSERT_TRUE(done());
+    }
+};
+
+// ---- The opening
+
+TEST_F(Gcl, TheOpeningByteByByte) {
+    setenv("LOGIN_USER", "root", 1);
+    connect();
+    EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
+    EXPECT_EQ(client.admin_state(), GCL_ADMIN_GREETING_AWAITED);
+    wire answer, request;
+    std::thread other([&] {
+        ASSERT_TRUE(provider.accept_client());
+        for (const char byte : greeting_bytes(~0u, ~0u)) { // a read for each byte
+            ASSERT_TRUE(provider.put(wire(1, byte)));
+            usleep(200);
+        }
+        answer = provider.take_frame();
+        request = provider.take_frame();
+        ASSERT_TRUE(provider.put(open_response_bytes(number_at(request, 32), 0)));
+    });
+    EXPECT_EQ(client.open(), LC_OK);
+    other.join();
+    EXPECT_EQ(client.admin_state(), GCL_ADMIN_OPEN_ANSWERED);
+    EXPECT_TRUE(gcl_session_service_is_open(client.session, 2));
+    EXPECT_FALSE(gcl_session_service_is_open(client.session, 1));
+    EXPECT_EQ(gcl_session_get_current_service(client.session), 2);
+
+    const wire header(
+        "GCLF3210\x00\x00\x00\x01\x00\x00\x00\x7a\x00\x20\x00\x00\x00\x1e\x84\x81\x00\x01\x00\x02"
+        "\x00\x00\x00\x5a",
+        32);
+    const wire body = wire("\x00\x02\x00\x00\x00\x00\x00\x00\x00\x00\x00\x00\x00\x00", 14) +
+                      padded(own_name(), 32) + be(geteuid(), 4) + be(getegid(), 4) + padded("root", 32) +
+                      wire("\x00\x00\x00\x00", 4);
+    EXPECT_EQ(answer, header + body);
+    const wire open_header(
+        "GCLF3210\x00\x00\x00\x01\x00\x00\x00\x50\x00\x20\x00\x00\x00\x1e\x84\x82\x00\x01\x00\x03"
+        "\x00\x00\x00\x30",
+        32);
+    const wire open_body("\x00\x00\x00\x01\x00\x00\x00\x01\x00\x00\x00\x02\x00\x00\x00\x02", 16);
+    EXPECT_EQ(request, open_header + padded(open_body, 48));
+
+    const char *own = nullptr, *peer = nullptr;
+    EXPECT_EQ(gcl_session_get_session_names(client.session, &own, &peer), LC_OK);
+    EXPECT_EQ(own, own_name());
+    EXPECT_STREQ(peer, "mgmtd-1");
+    EXPECT_EQ(access(own_path().c_str(), F_OK), 0);
+}
+
+TEST_F(Gcl, ThePeersIdsAreChecked) {
+    gcl_log log;
+    const uint32_t none = ~0u;
+    const struct {
+        uint32_t uid, gid;
+        uint16_t version;
+        bool accepted;
+        const char *line;
+    } cases[] = {
+        {none, none, 2, true, "client open for peer mgmtd-1"},
+        {geteuid(), getegid(), 2, true, "client open for peer mgmtd-1"},
+        {none, getegid(), 2, false, "proto admin: bad uid / gid in greeting: -1/0"},
+        {geteuid(), none, 2, false, "proto admin: bad uid / gid in greeting: 0/-1"},
+        {geteuid() + 7, getegid(), 2, false, "proto admin: bad uid / gid in greeting: 7/0 not 0/0"},
+        {none, none, 3, false, "proto admin: bad version in greeting: 3 not 2"},
+    };
+    for (const auto &row : cases) {
+        connect();
+        ASSERT_TRUE(provider.accept_client());
+        ASSERT_TRUE(provider.put(greeting_bytes(row.uid, row.gid, row.version)));
+        round();
+        EXPECT_EQ(client.state(), row.accepted ? GCL_SESSION_CONNECTED : GCL_SESSION_CLOSED) << row.line;
+        EXPECT_EQ(log.count(row.line), 1) << row.line;
+        EXPECT_EQ(log.count("session terminated by client"), row.accepted ? 0 : 1) << row.line;
+        log.clear();
+        EXPECT_EQ(gcl_session_close(client.session, 0), LC_OK);
+        EXPECT_EQ(gcl_session_free(&client.session), LC_OK);
+        provider.close_client();
+    }
+}
+
+TEST_F(Gcl, ARefusedServiceIsNoOpenService) {
+    connect();
+    std::thread other([&] {
+        ASSERT_TRUE(provider.accept_client());
+        ASSERT_TRUE(provider.put(greeting_bytes(~0u, ~0u)));
+        provider.take_frame();
+        const wire request = provider.take_frame();
+        ASSERT_TRUE(
+            provider.put(open_response_bytes(number_at(request, 32), 1, "Bad service id in service open.")));
+        // The second service is granted, the third refused again.
+        const wire second = provider.take_frame();
+        ASSERT_TRUE(provider.put(open_response_bytes(number_at(second, 32), 0)));
+        const wire third = provider.take_frame();
+        ASSERT_TRUE(provider.put(open_response_bytes(number_at(third, 32), 1)));
+    });
+    EXPECT_EQ(client.open(), LC_GENERIC);
+    EXPECT_EQ(client.admin_state(), GCL_ADMIN_OPEN_ANSWERED);
+    EXPECT_EQ(client.open(), LC_OK);
+    EXPECT_EQ(gcl_session_client_open_service_blocking(client.session, 2, 3, nullptr, 0, 3000), LC_GENERIC);
+    EXPECT_EQ(client.admin_state(), GCL_ADMIN_GREETED);
+    other.join();
+}
+
+TEST_F(Gcl, APeerThatNeverAnswersOrGoes) {
+    connect();
+    const double start = now_seconds();
+    EXPECT_EQ(client.open(150), LC_IO_TIMED_OUT);
+    EXPECT_GE(now_seconds() - start, 0.14);
+    EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
+    ASSERT_TRUE(provider.accept_client());
+    ASSERT_TRUE(provider.put(greeting_bytes(~0u, ~0u).substr(0, 60)));
+    provider.close_client(); // in mid-frame
+    EXPECT_EQ(client.open(), LC_IO_CLOSED);
+    EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
+    EXPECT_EQ(client.closes, 1);
+    EXPECT_EQ(client.open(), LC_IO_CLOSED);
+    EXPECT_EQ(gcl_session_close(client.session, 1), LC_OK);
+    EXPECT_EQ(client.closes, 1);
+}
+
+TEST_F(Gcl, ClientNames) {
+    gcl_session *session = nullptr;
+    for (const char *name : {"a-b", "abcdefghijklmnopqrst"}) {
+        EXPECT_EQ(gcl_session_client_new(client.instance, name, nullptr, 0, &session), LC_GENERIC);
+        EXPECT_EQ(session, nullptr);
+    }
+    const char *own = nullptr;
+    ASSERT_EQ(client.make("abcdefghijklmnopqrs"), LC_OK);
+    EXPECT_EQ(gcl_session_get_session_names(client.session, &own, nullptr), LC_OK);
+    EXPECT_EQ(own, "abcdefghijklmnopqrs-" + std::to_string(getpid()));
+    ASSERT_EQ(client.make(nullptr), LC_OK);
+    EXPECT_EQ(gcl_session_get_session_names(client.session, &own, nullptr), LC_OK);
+    EXPECT_EQ(own, "UNKNOWN-" + std::to_string(geteuid()) + "." + std::to_string(getpid()));
+}
+
+TEST_F(Gcl, NobodyThere) {
+    gcl_log log;
+    ASSERT_EQ(client.make(), LC_OK);
+    EXPECT_EQ(client.send(1, "early"), LC_GENERIC);
+    EXPECT_EQ(log.count("tried to send frame in state 2"), 1);
+    const double start = now_seconds();
+    EXPECT_EQ(gcl_session_client_connect_by_provider(client.session, "nobody", 0), LC_IO_ERROR);
+    EXPECT_LT(now_seconds() - start, 1);
+    EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
+    EXPECT_EQ(client.closes, 0); // no session was lost
+    EXPECT_EQ(log.count("Failed to connect to provider."), 1);
+    EXPECT_EQ(log.count("Error code"), 0);
+    EXPECT_EQ(gcl_session_client_connect_by_provider(client.session, "mgmtd", 0), LC_GENERIC);
+    EXPECT_EQ(log.count("client called to connect in invalid state: 1 (closed)"), 1);
+    // The loop neither spins over the closed descriptor nor ends.
+    const clock_t used = clock();
+    std::thread other([&] {
+        usleep(300000);
+        EXPECT_EQ(lew_escape_from_dispatch(client.wrapper), LC_OK);
+    });
+    EXPECT_EQ(lew_dispatch(client.wrapper, nullptr, nullptr), LC_OK);
+    other.join();
+    EXPECT_LT(static_cast<double>(clock() - used) / CLOCKS_PER_SEC, 0.15);
+}
+
+TEST_F(Gcl, AProviderThatComesLateIsFound) {
+    gcl_log log;
+    ASSERT_EQ(client.make(), LC_OK);
+    gcl_provider late;
+    std::thread other([&] {
+        usleep(500000);
+        ASSERT_TRUE(late.listen_as("late"));
+    });
+    const double start = now_seconds();
+    EXPECT_EQ(gcl_session_client_connect_by_provider(client.session, "late", 1), LC_OK);
+    EXPECT_NEAR(now_seconds() - start, 1.5, 0.4);
+    EXPECT_EQ(log.count("Could not connect to provider; delaying and retrying."), 1);
+    other.join();
+}
+
+// ---- The frame reader
+
+TEST_F(Gcl, FramesInEveryCut) {
+    open();
+    const wire small = frame_bytes(3, 7, ""), text = frame_bytes(3, 8, "text");
+    const wire large = frame_bytes(3, 9, wire(3000000, 'x'));
+    ASSERT_TRUE(provider.put(small + text)); // two in one read
+    until([&] { return client.frames.size() == 2; });
+    EXPECT_EQ(client.frames[0], be(7, 2));
+    EXPECT_EQ(client.frames[1], be(8, 2) + "text");
+    for (const size_t cut : {1u, 31u, 32u, 33u}) { // one over two reads
+        client.frames.clear();
+        ASSERT_TRUE(provider.put(text.substr(0, cut)));
+        round();
+        EXPECT_TRUE(client.frames.empty());
+        ASSERT_TRUE(provider.put(text.substr(cut) + small.substr(0, cut % 32)));
+        until([&] { return client.frames.size() == 1; });
+        ASSERT_TRUE(provider.put(small.substr(cut % 32)));
+        until([&] { return client.frames.size() == 2; });
+        EXPECT_EQ(client.frames[0], be(8, 2) + "text");
+        EXPECT_EQ(client.frames[1], be(7, 2));
+    }
+    client.frames.clear();
+    std::thread other([&] { ASSERT_TRUE(provider.put(text + large + text)); });
+    until([&] { return client.frames.size() == 3; });
+    other.join();
+    EXPECT_EQ(client.frames[1], be(9, 2) + wire(3000000, 'x'));
+    EXPECT_EQ(client.frames[2], be(8, 2) + "text");
+}
+
+TEST_F(Gcl, DataAndEndTogether) {
+    open();
+    ASSERT_TRUE(provider.put(frame_bytes(3, 1, "last") + frame_bytes(3, 2, "words") + "GCLF"));
+    provider.close_client();
+    round();
+    EXPECT_EQ(client.frames.size(), 2u);
+    EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
+    EXPECT_EQ(client.closes, 1);
+}
+
+TEST_F(Gcl, BadFramesEndTheSessionAndForeignOnesDoNot) {
+    const wire good = frame_bytes(3, 1, "body");
+    const auto with = [&](size_t offset, const wire &bytes) {
+        wire out = good;
+        return out.replace(offset, bytes.size(), bytes);
+    };
+    const struct {
+        wire bytes;
+        bool closes;
+        const char *line;
+    } cases[] = {
+        {frame_bytes(5, 1, "body"), false, "DISCARDED frame 1000001 (36) proto 5 "},
+        {frame_bytes(700, 1, "body"), false, "DISCARDED frame 1000001 (36) proto 700 "},
+        {frame_bytes(3, 65535, "body"), false, "upper layer handoff of 1000001 len 36"},
+        {frame_bytes(1, 9, "body"), false, "proto admin: in receive CATCHALL"},
+        {frame_bytes(1, 1, "short"), true, "closing after error condition"},
+        {frame_bytes(1, 4, "short"), true, "closing after error condition"},
+        {greeting_bytes(~0u, ~0u), true, "bad state in greeting:7 not 3"},
+        {with(0, "XCLF"), true, "invalid frame ident: "},
+        {with(8, be(2, 4)), true, "invalid frame version: 2"},
+        {with(16, be(31, 2)), true, "invalid frame header len: 31 vs 32"},
+        {with(12, be(31, 4)), true, "invalid frame total length: 31"},
+        {with(12, be(0, 4)), true, "invalid frame total length: 0"},
+        {with(12, be(0xffffffff, 4)), true, "invalid frame total length: 4294967295"},
+        {with(12, be((16 << 20) + 1, 4)), true, "invalid frame total length: 16777217"},
+    };
+    gcl_log log;
+    for (const auto &row : cases) {
+        client.closes = 0;
+        open();
+        log.clear();
+        ASSERT_TRUE(provider.put(row.bytes));
+        round();
+        EXPECT_EQ(log.count(row.line), 1) << row.line;
+        EXPECT_EQ(client.state(), row.closes ? GCL_SESSION_CLOSED : GCL_SESSION_CONNECTED) << row.line;
+        EXPECT_EQ(client.closes, row.closes ? 1 : 0) << row.line;
+        if (!row.closes) { // what follows is read as before
+            client.frames.clear();
+            ASSERT_TRUE(provider.put(good));
+            until([&] { return client.frames.size() == 1; });
+        }
+        EXPECT_EQ(gcl_session_close(client.session, 0), LC_OK);
+        EXPECT_EQ(gcl_session_free(&client.session), LC_OK);
+        provider.close_client();
+    }
+}
+
+// A frame of the largest size that is announced and never sent takes no memory for what has not come.
+TEST_F(Gcl, AnAnnouncedLengthTakesNoMemory) {
+    open();
+    wire header = frame_bytes(3, 1, "").replace(12, 4, be(16 << 20, 4));
+    const auto resident = [] {
+        FILE *file = fopen("/proc/self/statm", "r");
+        long size = 0, pages = 0;
+        EXPECT_EQ(fscanf(file, "%ld %ld", &size, &pages), 2);
+        fclose(file);
+        return size * 4;
+    };
+    const long before = resident();
+    ASSERT_TRUE(provider.put(header + wire(100, 'x')));
+    round();
+    EXPECT_LT(resident() - before, 1024);
+    EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
+}
+
+TEST_F(Gcl, AFailingHandlerEndsTheSession) {
+    gcl_log log;
+    open();
+    client.on_frame = [](const wire &) { return LC_BAD_TYPE; };
+    ASSERT_TRUE(provider.put(frame_bytes(3, 1, "a") + frame_bytes(3, 1, "b")));
+    round();
+    EXPECT_EQ(client.frames.size(), 1u);
+    EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
+    EXPECT_EQ(log.count("closing after error condition"), 1);
+}
+
+// A handler waits in the loop for later frames. Inside, the buffer moves, grows past its first size, and is
+// emptied, while the outer round still has frames to deliver; each piece that is sent ends in the middle of a
+// frame.
+TEST_F(Gcl, TheReaderNests) {
+    open();
+    const wire wait = frame_bytes(3, 1, "wait"), cut = frame_bytes(3, 3, "cut in two");
+    const wire piece = cut.substr(20) + frame_bytes(3, 2, wire(500000, 'y')) + cut.substr(0, 20);
+    std::mutex one_writer;
+    size_t waits = 0, deepest = 0, depth = 0;
+    client.on_frame = [&](const wire &frame) {
+        if (frame[1] != 1)
+            return LC_OK;
+        deepest = std::max(deepest, ++depth);
+        if (++waits <= 3) {
+            const size_t have = client.frames.size();
+            std::atomic<bool> sent{false};
+            std::thread other([&] {
+                const std::lock_guard<std::mutex> guard(one_writer);
+                EXPECT_TRUE(provider.put(piece));
+                sent = true;
+            });
+            until([&] { return sent && client.frames.size() >= have + 2; });
+            other.join();
+        }
+        depth--;
+        return LC_OK;
+    };
+    ASSERT_TRUE(provider.put(wait + wait + wait + wait + cut.substr(0, 20)));
+    until([&] { return waits == 4; });
+    ASSERT_TRUE(provider.put(cut.substr(20)));
+    until([&] { return client.frames.size() == 4 + 3 + 4; });
+    EXPECT_GE(deepest, 3u);
+    size_t count[4] = {};
+    for (const wire &frame : client.frames) {
+        count[static_cast<size_t>(frame[1])]++;
+        EXPECT_EQ(frame.size(), frame[1] == 2 ? 500002u : frame[1] == 1 ? 6u : 12u);
+    }
+    EXPECT_EQ(count[1], 4u);
+    EXPECT_EQ(count[2], 3u);
+    EXPECT_EQ(count[3], 4u);
+}
+
+// The session goes while its reader stands in a handler: closed by the peer in an inner round, closed by the
+// handler, or freed by it.
+TEST_F(Gcl, TheSessionGoesUnderItsReader) {
+    for (int way = 0; way < 3; way++) {
+        client.closes = 0;
+        client.frames.clear();
+        open();
+        client.on_frame = [&, way](const wire &) {
+            if (way == 0) {
+                provider.close_client();
+                until([&] { return client.closes == 1; });
+            } else if (way == 1) {
+                EXPECT_EQ(gcl_session_close(client.session, 0), LC_OK);
+            } else {
+                EXPECT_EQ(gcl_session_close(client.session, 0), LC_OK);
+                EXPECT_EQ(gcl_session_free(&client.session), LC_OK);
+            }
+            return LC_OK;
+        };
+        ASSERT_TRUE(provider.put(frame_bytes(3, 1, "a") + frame_bytes(3, 1, "b")));
+        round();
+        // What had come before the peer closed is delivered; after a close of our own nothing is.
+        EXPECT_EQ(client.frames.size(), way == 0 ? 2u : 1u) << way;
+        EXPECT_EQ(client.closes, 1) << way;
+        client.on_frame = nullptr;
+        EXPECT_EQ(gcl_session_free(&client.session), LC_OK);
+        provider.close_client();
+    }
+}
+
+// ---- The output queue
+
+TEST_F(Gcl, FramesGoOutWholeAndInOrder) {
+    open();
+    constexpr int count = 40;
+    const auto body = [](int i) { return wire(50000, static_cast<char>('A' + i % 26)); };
+    for (int i = 0; i < count; i++) // far more than the socket takes
+        ASSERT_EQ(client.send(static_cast<uint16_t>(i + 1), body(i)), LC_OK);
+    tbuffer *buffer = nullptr;
+    const wire room = wire(32, '\0') + "in place";
+    ASSERT_EQ(tb_new_buf(&buffer, room.data(), static_cast<int32_t>(room.size())), LC_OK);
+    EXPECT_EQ(gcl_session_send_frame_components_tb(client.session, 3, 99, 32, &buffer), LC_OK);
+    EXPECT_EQ(buffer, nullptr);
+    ASSERT_EQ(tb_new_buf(&buffer, "put", 3), LC_OK);
+    EXPECT_EQ(gcl_session_send_frame_components_tb(client.session, 3, 98, 16, &buffer), LC_OK);
+    EXPECT_EQ(buffer, nullptr);
+    std::vector<wire> got;
+    std::atomic<bool> all{false};
+    std::thread other([&] {
+        for (int i = 0; i < count + 2; i++)
+            got.push_back(provider.take_frame());
+        all = true;
+        ASSERT_TRUE(provider.put(frame_bytes(3, 1, "done")));
+    });
+    until([&] { return !client.frames.empty(); });
+    other.join();
+    for (int i = 0; i < count; i++)
+        EXPECT_EQ(got[static_cast<size_t>(i)],
+                  frame_bytes(3, static_cast<uint16_t>(i + 1), body(i), 2000003 + static_cast<uint32_t>(i)));
+    EXPECT_EQ(got[count], frame_bytes(3, 99, "in place", 2000003 + count));
+    EXPECT_EQ(got[count + 1], frame_bytes(3, 98, "put", 2000004 + count));
+    // Nothing waits any more: the loop is not woken for a writable socket.
+    const clock_t used = clock();
+    std::thread leaving([&] {
+        usleep(200000);
+        EXPECT_EQ(lew_escape_from_dispatch(client.wrapper), LC_OK);
+    });
+    EXPECT_EQ(lew_dispatch(client.wrapper, nullptr, nullptr), LC_OK);
+    leaving.join();
+    EXPECT_LT(static_cast<double>(clock() - used) / CLOCKS_PER_SEC, 0.1);
+}
+
+TEST_F(Gcl, AQueueThatFillsLosesFramesAndSaysSoOnce) {
+    gcl_log log;
+    open();
+    const wire body(65536, 'q');
+    uint32_t sent = 0;
+    for (int filling = 1; filling <= 2; filling++) {
+        log.clear();
+        int taken = 0, lost = 0;
+        while (lost < 50 && taken < 1000)
+            client.send(1, body) == LC_OK ? taken++ : lost++;
+        EXPECT_EQ(client.send(1, body), LC_CANCELLED);
+        EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
+        EXPECT_LE(static_cast<uint64_t>(taken) * (body.size() + 32), GCL_QUEUE_MAX_BYTES + 1000000);
+        EXPECT_GE(static_cast<uint64_t>(taken) * (body.size() + 32), GCL_QUEUE_MAX_BYTES - body.size() - 32);
+        EXPECT_EQ(log.count("output queue full"), 1) << filling;
+        EXPECT_EQ(log.count("Error code"), 0);
+        std::thread other([&] {
+            for (int i = 0; i < taken; i++)
+                ASSERT_EQ(provider.take_frame(), frame_bytes(3, 1, body, 2000003 + sent++));
+            ASSERT_TRUE(provider.put(frame_bytes(3, 2, "done")));
+        });
+        client.frames.clear();
+        until([&] { return !client.frames.empty(); });
+        other.join();
+        EXPECT_EQ(log.count("51 frames were lost"), 1) << filling;
+    }
+}
+
+TEST_F(Gcl, APeerThatGoesIsFoundByASender) {
+    open();
+    provider.close_client();
+    EXPECT_EQ(client.send(1, "to nobody"), LC_OK);
+    EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
+    EXPECT_EQ(client.closes, 1);
+    EXPECT_EQ(client.send(1, "to nobody"), LC_GENERIC);
+}
+
+TEST_F(Gcl, AFlushingCloseTellsWhatStays) {
+    gcl_log log;
+    open();
+    for (int i = 0; i < 20; i++)
+        ASSERT_EQ(client.send(1, wire(50000, 'f')), LC_OK);
+    EXPECT_EQ(gcl_session_close(client.session, 1), LC_OK);
+    EXPECT_EQ(log.count("closed with output queue"), 1);
+    EXPECT_EQ(client.closes, 1);
+    EXPECT_EQ(gcl_shutdown(client.instance), LC_OK);
+    EXPECT_EQ(client.closes, 1);
+}
+
+TEST_F(Gcl, AProtocolNumberIsGivenOnce) {
+    gcl_log log;
+    gcl_body_protocol again{};
+    again.protocol = 1;
+    EXPECT_EQ(gcl_register_body_protocol(client.instance, &again), LC_ASSERTION);
+    EXPECT_EQ(log.count("Already have registered body handler for proto 1"), 1);
+    gcl *nothing = nullptr;
+    EXPECT_EQ(gcl_deinit(&nothing), LC_OK);
+    EXPECT_EQ(gcl_init(&nothing, nullptr, nullptr), LC_NULL);
+}
+
+} // namespace
