@@ -95,8 +95,10 @@ TEST_F(Tunnels, ForceIgnoresTheReferences) {
 }
 
 TEST_F(Tunnels, ThirtyTwoIdsAndTheFreedOneIsNext) {
-    for (uint32_t i = 0; i < 32; i++)
+    for (uint32_t i = 0; i < 32; i++) {
         ASSERT_EQ(wccp_add_tunnel(1, self, router(i)), 0);
+        log.take();
+    }
     EXPECT_EQ(commands().back().tunnel_id, g_qv_encap_wccp_last);
     EXPECT_EQ(wccp_add_tunnel(1, self, router(32)), 1);
     EXPECT_NE(log.take().find("WCCP GRP 1: No free tunnel id available"), std::string::npos);
