@@ -53,7 +53,7 @@ struct array {
     array_free_function free;
     array_hash_function hash;
     const std::atomic<uint32_t> *key_changes;
-    mutable array_index *index; // null until a search needs it
+    mutable array_index *index; // null until a search needs it (array_index.h)
 };
 
 lc_status array_options_get_defaults(array_options *out);
@@ -113,7 +113,3 @@ int array_equal(const array *a, const array *b);
 using array_foreach_function = lc_status (*)(array *list, uint32_t index, void *element, void *data);
 lc_status array_foreach(array *list, array_foreach_function function, void *data);
 lc_status array_foreach_delete(array *list, array_foreach_function function, void *data);
-
-// Used by array.cpp; `array_index` is a hash from keys to positions.
-void array_index_drop(const array *list);
-bool array_index_find(const array *list, const void *key, uint32_t *out_position, bool *out_found);

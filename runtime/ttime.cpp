@@ -1,30 +1,28 @@
-// Microseconds are the base: the second and millisecond forms multiply to them on the way to text and divide
-// on the way back.
+// Times and their texts. Microseconds are the base: to text the coarser units multiply up to it, from text
+// they divide down from it and refuse what is negative or too large for them.
 #include "runtime/ttime.h"
 
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 
-#include "runtime/guards.h"
-#include "runtime/logging.h"
+constexpr int64_t US_PER_SEC = 1000000;
+constexpr int64_t US_PER_MS = 1000;
+constexpr int64_t SEC_LIMIT_US = 0x7a12000000000;
+constexpr uint32_t TEXT_SIZE = 36;
 
-constexpr uint32_t TEXT_BYTES = 36;
-constexpr uint32_t FRACTION_ROOM = 9; // a fraction is left out when the text ends closer to the buffer's end
-constexpr int64_t US = 1000000;
-constexpr int64_t MS_TO_US = 1000;
-constexpr int64_t SECONDS_LIMIT_US = 0x7a12000000000;
+// ---- Clock and records
 
 lt_time_us lt_curr_time_us() {
-    timeval now;
+    timeval now{};
     gettimeofday(&now, nullptr);
-    return static_cast<int64_t>(now.tv_sec) * US + now.tv_usec;
+    return int64_t{now.tv_sec} * US_PER_SEC + now.tv_usec;
 }
 lt_time_ms lt_curr_time_ms() {
-    return lt_curr_time_us() / MS_TO_US;
+    return lt_curr_time_us() / US_PER_MS;
 }
 lt_time_sec lt_curr_time() {
-    return static_cast<lt_time_sec>(lt_curr_time_us() / US);
+    return static_cast<lt_time_sec>(lt_curr_time_us() / US_PER_SEC);
 }
 
 lc_status lt_time_sec_to_tm(lt_time_sec seconds, tm *out) {
@@ -39,20 +37,20 @@ lc_status lt_time_sec_to_tm_utc(lt_time_sec seconds, tm *out) {
     CHECK_NULL(gmtime_r(&value, out));
     return LC_OK;
 }
-lt_time_us lt_tm_to_time_us(const tm *value) {
-    if (!value) {
+lt_time_us lt_tm_to_time_us(const tm *local) {
+    if (!local) {
         (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);
         return 0;
     }
-    tm copy = *value;
-    return static_cast<int64_t>(mktime(&copy)) * US;
+    tm copy = *local;
+    return int64_t{mktime(&copy)} * US_PER_SEC;
 }
-lt_time_sec lt_tm_utc_to_time_sec(const tm *value) {
-    if (!value) {
+lt_time_sec lt_tm_utc_to_time_sec(const tm *utc) {
+    if (!utc) {
         (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);
         return 0;
     }
-    tm copy = *value;
+    tm copy = *utc;
     return static_cast<lt_time_sec>(timegm(&copy));
 }
 lc_status lt_time_sec_to_timeval(lt_time_sec seconds, timeval *out) {
@@ -60,251 +58,256 @@ lc_status lt_time_sec_to_timeval(lt_time_sec seconds, timeval *out) {
     *out = {seconds, 0};
     return LC_OK;
 }
-lc_status lt_time_ms_to_timeval(lt_time_ms milliseconds, timeval *out) {
+lc_status lt_time_ms_to_timeval(lt_time_ms ms, timeval *out) {
     CHECK_NULL(out);
-    *out = {milliseconds / 1000, milliseconds % 1000 * MS_TO_US};
+    *out = {ms / 1000, (ms % 1000) * US_PER_MS};
     return LC_OK;
 }
 lt_time_sec lt_timeval_to_time_sec(const timeval *value) {
-    return value ? static_cast<lt_time_sec>(value->tv_sec) : 0;
+    if (!value) {
+        (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);
+        return 0;
+    }
+    return static_cast<lt_time_sec>(value->tv_sec);
 }
 lt_time_ms lt_timeval_to_time_ms(const timeval *value) {
-    return value ? static_cast<int64_t>(value->tv_sec) * 1000 + value->tv_usec / MS_TO_US : 0;
+    if (!value) {
+        (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);
+        return 0;
+    }
+    return int64_t{value->tv_sec} * 1000 + value->tv_usec / US_PER_MS;
 }
 
-// --- To text
-// --------------------------------------------------------------------------------------------------------
+// ---- To text
 
-#pragma GCC diagnostic push
-#pragma GCC diagnostic ignored "-Wformat-nonliteral"
-static lc_status put_time(const tm *value, const char *form, uint32_t size, char *buffer,
-                          uint32_t *out_length) {
-    CHECK_NULL(buffer);
-    const size_t length = size > 0 ? strftime(buffer, size, form, value) : 0;
-    CHECK_CONDITION(length > 0);
-    *out_length = static_cast<uint32_t>(length);
+static lc_status format_time(char *buffer, uint32_t size, size_t at, const char *format, const tm *parts,
+                             size_t *out_end) {
+    CHECK_CONDITION(at < size);
+    const size_t written = strftime(buffer + at, size - at, format, parts);
+    CHECK_CONDITION(written > 0);
+    *out_end = at + written;
     return LC_OK;
 }
-#pragma GCC diagnostic pop
 
-// Whole seconds, parts of a second from 0 up, also for times before 1970.
-struct split_time {
-    time_t seconds;
-    int64_t us;
-};
-static split_time split(int64_t us) {
-    int64_t rest = us % US;
-    if (rest < 0)
-        rest += US;
-    return {static_cast<time_t>((us - rest) / US), rest};
+// The fraction of a second without its leading 0, where it still fits.
+static void append_fraction(char *buffer, uint32_t size, size_t *at, int64_t value) {
+    const int64_t fraction = ((value % US_PER_SEC) + US_PER_SEC) % US_PER_SEC;
+    if (fraction == 0 || *at + 9 > size)
+        return;
+    char text[16];
+    const double seconds = static_cast<double>(fraction) / static_cast<double>(US_PER_SEC);
+    const int length = snprintf(text, sizeof text, fraction % US_PER_MS ? "%.6lf" : "%.3lf", seconds);
+    memcpy(buffer + *at, text + 1, static_cast<size_t>(length));
+    *at += static_cast<size_t>(length) - 1;
 }
 
-static lc_status add_fraction(int64_t us, uint32_t size, char *buffer, uint32_t *length) {
-    if (us == 0 || *length + FRACTION_ROOM > size)
-        return LC_OK;
-    char fraction[16];
-    const double part = static_cast<double>(us) / static_cast<double>(US);
-    snprintf(fraction, sizeof fraction, us % MS_TO_US == 0 ? "%.3lf" : "%.6lf", part);
-    CHECK_CONDITION(strlcpy(buffer + *length, fraction + 1, size - *length) < size - *length);
-    *length += static_cast<uint32_t>(strlen(fraction + 1));
+static int64_t whole_seconds(int64_t us) {
+    return us / US_PER_SEC - (us % US_PER_SEC < 0);
+}
+
+static lc_status to_text(int64_t us, bool local, const char *format, bool with_zone, uint32_t size,
+                         char *buffer) {
+    CHECK_NULL(buffer);
+    const time_t seconds = whole_seconds(us);
+    tm parts{};
+    CHECK_NULL(local ? localtime_r(&seconds, &parts) : gmtime_r(&seconds, &parts));
+    size_t at = 0;
+    CHECK_STATUS(format_time(buffer, size, at, format, &parts, &at));
+    append_fraction(buffer, size, &at, us);
+    if (with_zone)
+        CHECK_STATUS(format_time(buffer, size, at, " %z", &parts, &at));
     return LC_OK;
 }
 
 lc_status lt_date_to_buf(lt_date value, uint32_t size, char *buffer, uint32_t *out_length) {
-    uint32_t length = 0;
+    CHECK_NULL(buffer);
     const time_t seconds = value;
-    tm parts = {};
+    tm parts{};
     CHECK_NULL(gmtime_r(&seconds, &parts));
-    CHECK_STATUS(put_time(&parts, "%Y/%m/%d", size, buffer, &length));
+    size_t end = 0;
+    CHECK_STATUS(format_time(buffer, size, 0, "%Y/%m/%d", &parts, &end));
     if (out_length)
-        *out_length = length;
+        *out_length = static_cast<uint32_t>(end);
     return LC_OK;
 }
-
 lc_status lt_daytime_us_to_buf(lt_time_us value, uint32_t size, char *buffer) {
-    const split_time time = split(value);
-    uint32_t length = 0;
-    tm parts = {};
-    CHECK_NULL(gmtime_r(&time.seconds, &parts));
-    CHECK_STATUS(put_time(&parts, "%H:%M:%S", size, buffer, &length));
-    CHECK_STATUS(add_fraction(time.us, size, buffer, &length));
-    return LC_OK;
+    return to_text(value, false, "%H:%M:%S", false, size, buffer);
 }
-
 lc_status lt_datetime_us_to_buf(lt_time_us value, int with_zone, uint32_t size, char *buffer) {
-    const split_time time = split(value);
-    uint32_t length = 0, zone = 0;
-    tm parts = {};
-    CHECK_NULL(localtime_r(&time.seconds, &parts));
-    CHECK_STATUS(put_time(&parts, "%Y/%m/%d %H:%M:%S", size, buffer, &length));
-    CHECK_STATUS(add_fraction(time.us, size, buffer, &length));
-    if (with_zone)
-        CHECK_STATUS(put_time(&parts, " %z", size - length, buffer + length, &zone));
-    return LC_OK;
+    return to_text(value, true, "%Y/%m/%d %H:%M:%S", with_zone != 0, size, buffer);
 }
-
 lc_status lt_dur_us_to_buf(lt_dur_us value, uint32_t size, char *buffer) {
     CHECK_NULL(buffer);
-    const int length =
-        snprintf(buffer, size, "%lf seconds", static_cast<double>(value) / static_cast<double>(US));
+    const double seconds = static_cast<double>(value) / static_cast<double>(US_PER_SEC);
+    const int length = snprintf(buffer, size, "%lf seconds", seconds);
     CHECK_CONDITION(length >= 0 && static_cast<uint32_t>(length) < size);
     return LC_OK;
 }
 
-static lc_status lt_datetime_us_no_zone(lt_time_us value, uint32_t size, char *buffer) {
-    return lt_datetime_us_to_buf(value, 0, size, buffer);
+// The coarser units; a value too large for microseconds doesn't fit any text.
+static lc_status scaled(int64_t value, int64_t factor, int64_t *out) {
+    CHECK_CONDITION(!__builtin_mul_overflow(value, factor, out));
+    return LC_OK;
 }
-static lc_status lt_date_us(int64_t value, uint32_t size, char *buffer) {
-    return lt_date_to_buf(static_cast<lt_date>(value), size, buffer, nullptr);
-}
+#define LT_COARSER(kind, unit, type, factor, parameters, arguments)                                          \
+    lc_status lt_##kind##_##unit##_to_buf(type value, LT_UNPAREN parameters uint32_t size, char *buffer) {   \
+        int64_t us = 0;                                                                                      \
+        CHECK_STATUS(scaled(value, factor, &us));                                                            \
+        return lt_##kind##_us_to_buf(us, LT_UNPAREN arguments size, buffer);                                 \
+    }
+#define LT_UNPAREN(...) __VA_ARGS__ __VA_OPT__(, )
+LT_COARSER(daytime, sec, lt_time_sec, US_PER_SEC, (), ())
+LT_COARSER(daytime, ms, lt_time_ms, US_PER_MS, (), ())
+LT_COARSER(datetime, sec, lt_time_sec, US_PER_SEC, (int with_zone), (with_zone))
+LT_COARSER(datetime, ms, lt_time_ms, US_PER_MS, (int with_zone), (with_zone))
+LT_COARSER(dur, sec, lt_dur_sec, US_PER_SEC, (), ())
+LT_COARSER(dur, ms, lt_dur_ms, US_PER_MS, (), ())
 
-static lc_status new_text(lc_status (*to_buf)(int64_t, uint32_t, char *), int64_t value, char **out) {
+template <typename Write>
+static lc_status to_str(char **out, Write write) {
     CHECK_NULL(out);
     *out = nullptr;
-    owned_text text(static_cast<char *>(malloc(TEXT_BYTES)));
-    CHECK_NULL(text.pointer);
-    CHECK_STATUS(to_buf(value, TEXT_BYTES, text.pointer));
-    *out = text.take();
+    auto *text = static_cast<char *>(malloc(TEXT_SIZE));
+    CHECK_NULL(text);
+    const lc_status status = write(text);
+    if (status != LC_OK)
+        free(text);
+    CHECK_STATUS(status);
+    *out = text;
+    return LC_OK;
+}
+lc_status lt_date_to_str(lt_date value, char **out) {
+    return to_str(out, [&](char *text) { return lt_date_to_buf(value, TEXT_SIZE, text, nullptr); });
+}
+#define LT_TO_STR(name, type, parameters, arguments)                                                         \
+    lc_status lt_##name##_to_str(type value, LT_UNPAREN parameters char **out) {                             \
+        return to_str(out, [&](char *text) {                                                                 \
+            return lt_##name##_to_buf(value, LT_UNPAREN arguments TEXT_SIZE, text);                          \
+        });                                                                                                  \
+    }
+LT_TO_STR(daytime_sec, lt_time_sec, (), ())
+LT_TO_STR(daytime_ms, lt_time_ms, (), ())
+LT_TO_STR(daytime_us, lt_time_us, (), ())
+LT_TO_STR(datetime_sec, lt_time_sec, (int with_zone), (with_zone))
+LT_TO_STR(datetime_ms, lt_time_ms, (int with_zone), (with_zone))
+LT_TO_STR(datetime_us, lt_time_us, (int with_zone), (with_zone))
+LT_TO_STR(dur_sec, lt_dur_sec, (), ())
+LT_TO_STR(dur_ms, lt_dur_ms, (), ())
+LT_TO_STR(dur_us, lt_dur_us, (), ())
+
+// ---- From text
+
+// Truncates to microseconds what the text said: most decimal fractions lie a hair beside it as a double, and
+// a text that lt_..._to_str wrote must read back as the value that it was.
+static int64_t truncated_us(double seconds) {
+    const double us = seconds * static_cast<double>(US_PER_SEC);
+    return static_cast<int64_t>(us + us * 1e-15);
+}
+
+static lc_status fraction_from_text(const char *text, int64_t *out_us) {
+    double fraction = 0;
+    if (*text == 0)
+        return LC_OK;
+    if (*text != '.' || sscanf(text, "%lf", &fraction) != 1 || !(fraction >= 0 && fraction < 1))
+        return LC_BAD_TYPE;
+    *out_us = truncated_us(fraction);
     return LC_OK;
 }
 
-lc_status lt_date_to_str(lt_date value, char **out) {
-    return new_text(lt_date_us, value, out);
-}
-
-// The three widths of a family, each by way of microseconds.
-#define WIDTHS_TO_TEXT(family, type_sec, type_ms, to_buf)                                                    \
-    lc_status lt_##family##_sec_to_str(type_sec value, char **out) {                                         \
-        return new_text(to_buf, value * US, out);                                                            \
-    }                                                                                                        \
-    lc_status lt_##family##_ms_to_str(type_ms value, char **out) {                                           \
-        return new_text(to_buf, value * MS_TO_US, out);                                                      \
-    }                                                                                                        \
-    lc_status lt_##family##_us_to_str(type_ms value, char **out) {                                           \
-        return new_text(to_buf, value, out);                                                                 \
+static lc_status from_text(const char *text, bool local, lt_time_us *out) {
+    CHECK_NULL(out);
+    *out = 0;
+    CHECK_NULL(text);
+    tm parts{};
+    const char *rest = strptime(text, "%Y/%m/%d %H:%M:%S", &parts);
+    if (!rest) {
+        parts = tm{};
+        rest = strptime(text, "%Y/%m/%d %H:%M", &parts);
     }
-#define WIDTHS_TO_BUF(family, type_sec, type_ms)                                                             \
-    lc_status lt_##family##_sec_to_buf(type_sec value, uint32_t size, char *buffer) {                        \
-        return lt_##family##_us_to_buf(value * US, size, buffer);                                            \
-    }                                                                                                        \
-    lc_status lt_##family##_ms_to_buf(type_ms value, uint32_t size, char *buffer) {                          \
-        return lt_##family##_us_to_buf(value * MS_TO_US, size, buffer);                                      \
-    }
-WIDTHS_TO_TEXT(daytime, lt_time_sec, lt_time_ms, lt_daytime_us_to_buf)
-WIDTHS_TO_TEXT(datetime, lt_time_sec, lt_time_ms, lt_datetime_us_no_zone)
-WIDTHS_TO_TEXT(dur, lt_dur_sec, lt_dur_ms, lt_dur_us_to_buf)
-WIDTHS_TO_BUF(daytime, lt_time_sec, lt_time_ms)
-WIDTHS_TO_BUF(dur, lt_dur_sec, lt_dur_ms)
-
-lc_status lt_datetime_sec_to_buf(lt_time_sec value, int with_zone, uint32_t size, char *buffer) {
-    return lt_datetime_us_to_buf(value * US, with_zone, size, buffer);
+    int64_t fraction = 0;
+    if (!rest || fraction_from_text(rest, &fraction) != LC_OK)
+        return LC_BAD_TYPE;
+    parts.tm_isdst = -1;
+    const time_t seconds = local ? mktime(&parts) : timegm(&parts);
+    *out = int64_t{seconds} * US_PER_SEC + fraction;
+    return LC_OK;
 }
-lc_status lt_datetime_ms_to_buf(lt_time_ms value, int with_zone, uint32_t size, char *buffer) {
-    return lt_datetime_us_to_buf(value * MS_TO_US, with_zone, size, buffer);
-}
-
-// --- From text
-// ------------------------------------------------------------------------------------------------------
 
 lc_status lt_str_to_date(const char *text, lt_date *out) {
     CHECK_NULL(out);
     *out = 0;
     CHECK_NULL(text);
-    tm parts = {};
+    tm parts{};
     const char *rest = strptime(text, "%Y/%m/%d", &parts);
     if (!rest || *rest)
         return LC_BAD_TYPE;
-    *out = static_cast<lt_date>(timegm(&parts));
+    const time_t seconds = timegm(&parts);
+    if (seconds < 0 || seconds > UINT32_MAX)
+        return LC_BAD_TYPE;
+    *out = static_cast<lt_date>(seconds);
     return LC_OK;
 }
-
-static lc_status parse_datetime(const char *text, bool utc, int64_t *out) {
-    tm parts = {};
-    const char *rest = strptime(text, "%Y/%m/%d %H:%M:%S", &parts);
-    if (!rest) {
-        parts = {};
-        rest = strptime(text, "%Y/%m/%d %H:%M", &parts);
-    }
-    if (!rest)
-        return LC_BAD_TYPE;
-    double fraction = 0;
-    if (*rest && (*rest != '.' || sscanf(rest, "%lf", &fraction) != 1))
-        return LC_BAD_TYPE;
-    parts.tm_isdst = -1;
-    const int64_t seconds = utc ? timegm(&parts) : mktime(&parts);
-    *out = seconds * US + static_cast<int64_t>(fraction * static_cast<double>(US));
-    return LC_OK;
-}
-
 lc_status lt_str_to_datetime_us(const char *text, lt_time_us *out) {
-    CHECK_NULL(out);
-    *out = 0;
-    CHECK_NULL(text);
-    return parse_datetime(text, false, out);
+    return from_text(text, true, out);
 }
-
 lc_status lt_str_to_daytime_us(const char *text, lt_time_us *out) {
     CHECK_NULL(out);
     *out = 0;
     CHECK_NULL(text);
-    char full[64];
-    if (static_cast<size_t>(snprintf(full, sizeof full, "1970/1/1 %s", text)) >= sizeof full)
+    char whole[64];
+    const int length = snprintf(whole, sizeof whole, "1970/1/1 %s", text);
+    if (length < 0 || static_cast<size_t>(length) >= sizeof whole)
         return LC_BAD_TYPE;
-    return parse_datetime(full, true, out);
+    return from_text(whole, false, out);
 }
-
 lc_status lt_str_to_dur_us(const char *text, lt_dur_us *out) {
     CHECK_NULL(out);
     *out = 0;
     CHECK_NULL(text);
     double seconds = 0;
-    if (sscanf(text, "%lf", &seconds) != 1 || !(seconds > -9e12 && seconds < 9e12))
+    if (sscanf(text, "%lf", &seconds) != 1)
         return LC_BAD_TYPE;
-    *out = static_cast<int64_t>(seconds * static_cast<double>(US));
+    if (!(seconds > -9.2e12 && seconds < 9.2e12)) // infinities and what is no number as well
+        return LC_BAD_TYPE;
+    *out = truncated_us(seconds);
     return LC_OK;
 }
 
-static lc_status from_us(lc_status (*parse)(const char *, int64_t *), const char *text, int64_t divisor,
-                         int64_t *out) {
-    int64_t us = 0;
-    CHECK_QUIET(parse(text, &us));
-    CHECK_CONDITION(us >= 0 && (divisor != US || us < SECONDS_LIMIT_US));
-    *out = us / divisor;
+static lc_status to_ms(lt_time_us us, int64_t *out) {
+    CHECK_CONDITION(us >= 0);
+    *out = us / US_PER_MS;
     return LC_OK;
 }
-static lc_status seconds_from_us(lc_status (*parse)(const char *, int64_t *), const char *text,
-                                 int32_t *out) {
-    CHECK_NULL(out);
-    *out = 0;
-    int64_t seconds = 0;
-    CHECK_QUIET(from_us(parse, text, US, &seconds));
-    *out = static_cast<int32_t>(seconds);
+static lc_status to_sec(lt_time_us us, int32_t *out) {
+    CHECK_CONDITION(us >= 0 && us < SEC_LIMIT_US);
+    *out = static_cast<int32_t>(us / US_PER_SEC);
     return LC_OK;
 }
-static lc_status ms_from_us(lc_status (*parse)(const char *, int64_t *), const char *text, int64_t *out) {
-    CHECK_NULL(out);
-    *out = 0;
-    CHECK_QUIET(from_us(parse, text, MS_TO_US, out));
-    return LC_OK;
-}
-#define WIDTHS_FROM_TEXT(family, type_sec, type_ms)                                                          \
-    lc_status lt_str_to_##family##_sec(const char *text, type_sec *out) {                                    \
-        return seconds_from_us(lt_str_to_##family##_us, text, out);                                          \
-    }                                                                                                        \
-    lc_status lt_str_to_##family##_ms(const char *text, type_ms *out) {                                      \
-        return ms_from_us(lt_str_to_##family##_us, text, out);                                               \
+#define LT_FROM_STR(kind, unit, type)                                                                        \
+    lc_status lt_str_to_##kind##_##unit(const char *text, type *out) {                                       \
+        CHECK_NULL(out);                                                                                     \
+        *out = 0;                                                                                            \
+        lt_time_us us = 0;                                                                                   \
+        CHECK_QUIET(lt_str_to_##kind##_us(text, &us));                                                       \
+        return to_##unit(us, out);                                                                           \
     }
-WIDTHS_FROM_TEXT(daytime, lt_time_sec, lt_time_ms)
-WIDTHS_FROM_TEXT(datetime, lt_time_sec, lt_time_ms)
-WIDTHS_FROM_TEXT(dur, lt_dur_sec, lt_dur_ms)
+LT_FROM_STR(daytime, ms, lt_time_ms)
+LT_FROM_STR(daytime, sec, lt_time_sec)
+LT_FROM_STR(datetime, ms, lt_time_ms)
+LT_FROM_STR(datetime, sec, lt_time_sec)
+LT_FROM_STR(dur, ms, lt_dur_ms)
+LT_FROM_STR(dur, sec, lt_dur_sec)
 
+// A zone that doesn't exist, then none: the second tzset behind localtime cannot take the first for the same.
 lc_status lt_timezone_handle_changed() {
-    CHECK_STATUS(lc_setenv("TZ", "error", 1));
+    const lc_status status = lc_setenv("TZ", "error", 1);
     tzset();
-    unsetenv("TZ");
+    {
+        lc_lock_guard guard(lc_env_lock);
+        unsetenv("TZ");
+    }
     const time_t now = time(nullptr);
-    tm ignored = {};
-    tzset();
-    (void)localtime_r(&now, &ignored);
+    (void)localtime(&now);
+    CHECK_STATUS(status);
     return LC_OK;
 }

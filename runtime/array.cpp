@@ -1,0 +1,494 @@
+// The generic array. All elements lie in one block of slots; whoever owns the array guards it.
+//
+// `sorted` says that the elements are known to be in order. Appending and inserting keep it where the
+// neighbours agree, so that an array filled in order is searched by halves; set, and a null left in a place,
+// give it up. A large array that is not in order, and whose family gives a hash, answers array_best_search
+// from an index (array_index.cpp), or a start with ten thousand bindings would be quadratic.
+#include "runtime/array.h"
+
+#include <algorithm>
+#include <cstdlib>
+#include <cstring>
+
+#include "runtime/array_index.h"
+#include "runtime/logging.h"
+
+int array_std_compare_func(const void *a, const void *b) {
+    const auto left = *static_cast<const uintptr_t *>(a), right = *static_cast<const uintptr_t *>(b);
+    const auto difference = static_cast<intptr_t>(left - right);
+    return (difference > 0) - (difference < 0);
+}
+lc_status array_std_assign_func(const void *element, void **out_copy) {
+    CHECK_NULL(out_copy);
+    *out_copy = const_cast<void *>(element);
+    return LC_OK;
+}
+lc_status array_std_takeover_func(void **inout_element, void **out_slot) {
+    CHECK_NULL(inout_element);
+    CHECK_NULL(out_slot);
+    *out_slot = *inout_element;
+    *inout_element = nullptr;
+    return LC_OK;
+}
+static void free_nothing(void *) {}
+
+// ---- Options and life
+
+lc_status array_options_get_defaults(array_options *out) {
+    CHECK_NULL(out);
+    *out = array_options{};
+    out->initial_size = 10;
+    out->compare = array_std_compare_func;
+    out->takeover = array_std_takeover_func;
+    out->free = free_nothing;
+    out->duplicate_policy = array_dup_allow;
+    out->require_sorted = 1;
+    return LC_OK;
+}
+lc_status array_options_get(const array *list, array_options *out) {
+    CHECK_NULL(out);
+    CHECK_NULL(list);
+    *out = {list->initial_size,     list->compare,        list->duplicate, list->takeover,   list->free,
+            list->duplicate_policy, list->require_sorted, list->hash,      list->key_changes};
+    return LC_OK;
+}
+lc_status array_options_set(array *list, const array_options *options) {
+    CHECK_NULL(list);
+    CHECK_NULL(options);
+    if (options->compare != list->compare && list->length > 1)
+        list->sorted = 0;
+    list->initial_size = std::max(options->initial_size, 1u);
+    list->compare = options->compare;
+    list->duplicate = options->duplicate;
+    list->takeover = options->takeover ? options->takeover : array_std_takeover_func;
+    list->free = options->free ? options->free : free_nothing;
+    list->duplicate_policy = options->duplicate_policy;
+    list->require_sorted = options->require_sorted;
+    list->hash = options->hash;
+    list->key_changes = options->key_changes;
+    array_index_drop(list);
+    return LC_OK;
+}
+
+lc_status array_new(array **out, const array_options *options) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    array_options defaults;
+    CHECK_STATUS(array_options_get_defaults(&defaults));
+    auto *list = static_cast<array *>(calloc(1, sizeof(array)));
+    CHECK_NULL(list);
+    (void)array_options_set(list, options ? options : &defaults);
+    list->elements = static_cast<void **>(calloc(list->initial_size, sizeof(void *)));
+    if (!list->elements)
+        free(list);
+    else
+        *out = list;
+    CHECK_NULL(*out);
+    list->capacity = list->initial_size;
+    list->sorted = 1;
+    return LC_OK;
+}
+
+static void give(array *list, void *element) {
+    if (element)
+        list->free(element);
+}
+
+lc_status array_free(array **inout) {
+    CHECK_NULL(inout);
+    array *list = *inout;
+    *inout = nullptr;
+    if (!list)
+        return LC_OK;
+    array_index_drop(list);
+    while (list->length)
+        give(list, list->elements[--list->length]);
+    free(list->elements);
+    free(list);
+    return LC_OK;
+}
+lc_status array_empty(array *list) {
+    CHECK_NULL(list);
+    array_index_drop(list);
+    while (list->length)
+        give(list, list->elements[--list->length]);
+    list->sorted = 1;
+    if (list->capacity != list->initial_size) {
+        auto *smaller = static_cast<void **>(realloc(list->elements, list->initial_size * sizeof(void *)));
+        if (smaller) {
+            list->elements = smaller;
+            list->capacity = list->initial_size;
+        }
+    }
+    return LC_OK;
+}
+
+static lc_status make_room(array *list, uint64_t length) {
+    CHECK_CONDITION(length <= array_size_max);
+    uint64_t capacity = list->capacity;
+    while (capacity < length)
+        capacity = std::min<uint64_t>(std::max(capacity + 10, capacity * 2), array_size_max);
+    if (capacity == list->capacity)
+        return LC_OK;
+    auto *elements = static_cast<void **>(realloc(list->elements, capacity * sizeof(void *)));
+    CHECK_NULL(elements);
+    list->elements = elements;
+    list->capacity = static_cast<uint32_t>(capacity);
+    return LC_OK;
+}
+
+// ---- Reading
+
+lc_status array_length(const array *list, uint32_t *out_length) {
+    CHECK_NULL(out_length);
+    *out_length = 0;
+    CHECK_NULL(list);
+    *out_length = list->length;
+    return LC_OK;
+}
+lc_status array_get(const array *list, uint32_t index, void **out_element) {
+    CHECK_NULL(out_element);
+    *out_element = nullptr;
+    CHECK_NULL(list);
+    if (index >= list->length)
+        return LC_NOT_FOUND;
+    *out_element = list->elements[index];
+    return LC_OK;
+}
+lc_status array_peek(const array *list, void **out_element) {
+    CHECK_NULL(out_element);
+    *out_element = nullptr;
+    CHECK_NULL(list);
+    return list->length ? array_get(list, list->length - 1, out_element) : LC_NOT_FOUND;
+}
+
+// ---- Placing
+
+static lc_status copy_of(const array *list, const void *element, void **out) {
+    *out = nullptr;
+    if (!element)
+        return LC_OK;
+    CHECK_CONDITION(list->duplicate);
+    CHECK_STATUS(list->duplicate(element, out));
+    return LC_OK;
+}
+
+// Runs a takeover operation with a copy of the element.
+template <typename Operation>
+static lc_status with_copy(array *list, const void *element, Operation operation) {
+    CHECK_NULL(list);
+    void *copy = nullptr;
+    CHECK_QUIET(copy_of(list, element, &copy));
+    const lc_status status = operation(&copy);
+    give(list, copy);
+    return status;
+}
+
+// An element has come to `index`: are the neighbours still in order?
+static void note_order(array *list, uint32_t index) {
+    if (!list->sorted)
+        return;
+    void **at = &list->elements[index];
+    if (!list->compare || !*at || (index > 0 && list->compare(at - 1, at) > 0) ||
+        (index + 1 < list->length && list->compare(at, at + 1) > 0))
+        list->sorted = list->length == 1 && *at;
+}
+
+lc_status array_set_takeover(array *list, uint32_t index, void **inout_element) {
+    CHECK_NULL(list);
+    CHECK_NULL(inout_element);
+    CHECK_STATUS(make_room(list, uint64_t{index} + 1));
+    array_index_drop(list);
+    while (list->length <= index)
+        list->elements[list->length++] = nullptr;
+    void *old = list->elements[index];
+    if (old == *inout_element) {
+        *inout_element = nullptr;
+        return LC_OK;
+    }
+    CHECK_STATUS(list->takeover(inout_element, &list->elements[index]));
+    list->sorted = 0;
+    give(list, old);
+    return LC_OK;
+}
+lc_status array_set(array *list, uint32_t index, const void *element) {
+    return with_copy(list, element, [&](void **copy) { return array_set_takeover(list, index, copy); });
+}
+
+lc_status array_insert_takeover(array *list, uint32_t index, void **inout_element) {
+    CHECK_NULL(list);
+    CHECK_NULL(inout_element);
+    if (index > list->length) // beyond the end there is nothing to move up
+        return array_set_takeover(list, index, inout_element);
+    CHECK_STATUS(make_room(list, uint64_t{list->length} + 1));
+    if (index < list->length)
+        array_index_drop(list);
+    void *slot = nullptr;
+    CHECK_STATUS(list->takeover(inout_element, &slot));
+    memmove(list->elements + index + 1, list->elements + index, (list->length - index) * sizeof(void *));
+    list->elements[index] = slot;
+    list->length++;
+    note_order(list, index);
+    return LC_OK;
+}
+lc_status array_insert(array *list, uint32_t index, const void *element) {
+    return with_copy(list, element, [&](void **copy) { return array_insert_takeover(list, index, copy); });
+}
+
+// What the policy says of a new element that equals the one at `index`.
+static lc_status meet_equal(array *list, uint32_t index, void **inout_element, bool *out_done) {
+    *out_done = true;
+    if (list->duplicate_policy == array_dup_refuse)
+        return LC_EXISTS;
+    if (list->duplicate_policy == array_dup_drop) {
+        give(list, *inout_element);
+        *inout_element = nullptr;
+        return LC_OK;
+    }
+    *out_done = false;
+    return array_delete(list, index);
+}
+
+lc_status array_append_no_dup_takeover(array *list, void **inout_element) {
+    CHECK_NULL(list);
+    CHECK_NULL(inout_element);
+    uint32_t index = 0;
+    CHECK_STATUS(make_room(list, uint64_t{list->length} + 1));
+    if (list->duplicate_policy != array_dup_allow &&
+        array_linear_search(list, *inout_element, 0, &index) == LC_OK) {
+        bool done = false;
+        CHECK_QUIET(meet_equal(list, index, inout_element, &done));
+        if (done)
+            return LC_OK;
+    }
+    return array_insert_takeover(list, list->length, inout_element);
+}
+lc_status array_append_no_dup(array *list, const void *element) {
+    return with_copy(list, element, [&](void **copy) { return array_append_no_dup_takeover(list, copy); });
+}
+lc_status array_append(array *list, const void *element) {
+    return array_append_no_dup(list, element);
+}
+lc_status array_append_takeover(array *list, void **inout_element) {
+    return array_append_no_dup_takeover(list, inout_element);
+}
+
+lc_status array_find_insertion_point_hint(const array *list, const void *element, uint32_t,
+                                          uint32_t *out_index) {
+    CHECK_NULL(out_index);
+    *out_index = 0;
+    CHECK_NULL(list);
+    CHECK_CONDITION(list->compare);
+    while (*out_index < list->length && list->compare(&list->elements[*out_index], &element) <= 0)
+        ++*out_index;
+    return LC_OK;
+}
+lc_status array_insert_sorted_hint_takeover(array *list, void **inout_element, uint32_t hint) {
+    CHECK_NULL(list);
+    CHECK_NULL(inout_element);
+    CHECK_CONDITION(list->sorted || !list->require_sorted);
+    uint32_t index = 0;
+    CHECK_STATUS(make_room(list, uint64_t{list->length} + 1));
+    CHECK_STATUS(array_find_insertion_point_hint(list, *inout_element, hint, &index));
+    if (index > 0 && list->duplicate_policy != array_dup_allow &&
+        list->compare(&list->elements[index - 1], inout_element) == 0) {
+        bool done = false;
+        CHECK_QUIET(meet_equal(list, --index, inout_element, &done));
+        if (done)
+            return LC_OK;
+    }
+    CHECK_STATUS(array_insert_takeover(list, index, inout_element));
+    list->sorted = 1;
+    return LC_OK;
+}
+lc_status array_insert_sorted_takeover(array *list, void **inout_element) {
+    return array_insert_sorted_hint_takeover(list, inout_element, 0);
+}
+lc_status array_insert_sorted_hint(array *list, const void *element, uint32_t hint) {
+    return with_copy(list, element,
+                     [&](void **copy) { return array_insert_sorted_hint_takeover(list, copy, hint); });
+}
+lc_status array_insert_sorted(array *list, const void *element) {
+    return array_insert_sorted_hint(list, element, 0);
+}
+
+// ---- Taking out
+
+lc_status array_remove_no_shift(array *list, uint32_t index, void **out_element) {
+    CHECK_NULL(out_element);
+    CHECK_QUIET(array_get(list, index, out_element));
+    array_index_drop(list);
+    list->elements[index] = nullptr;
+    list->sorted = 0;
+    return LC_OK;
+}
+lc_status array_remove(array *list, uint32_t index, void **out_element) {
+    CHECK_NULL(out_element);
+    CHECK_QUIET(array_get(list, index, out_element));
+    array_index_drop(list);
+    list->length--;
+    memmove(list->elements + index, list->elements + index + 1, (list->length - index) * sizeof(void *));
+    return LC_OK;
+}
+lc_status array_delete(array *list, uint32_t index) {
+    void *element = nullptr;
+    CHECK_QUIET(array_remove(list, index, &element));
+    give(list, element);
+    return LC_OK;
+}
+lc_status array_delete_no_shift(array *list, uint32_t index) {
+    void *element = nullptr;
+    CHECK_QUIET(array_remove_no_shift(list, index, &element));
+    give(list, element);
+    return LC_OK;
+}
+lc_status array_pop(array *list, void **out_element) {
+    CHECK_NULL(out_element);
+    *out_element = nullptr;
+    CHECK_NULL(list);
+    return list->length ? array_remove(list, list->length - 1, out_element) : LC_NOT_FOUND;
+}
+
+// ---- Order and search
+
+lc_status array_sort(array *list) {
+    CHECK_NULL(list);
+    CHECK_CONDITION(list->compare);
+    if (list->sorted)
+        LC_LOG(LC_LOG_DEBUG, "Sorting an already-sorted array.");
+    array_index_drop(list);
+    if (list->length > 1)
+        qsort(list->elements, list->length, sizeof(void *), list->compare);
+    list->sorted = 1;
+    return LC_OK;
+}
+
+static lc_status told(uint32_t index, uint32_t *out_index) {
+    if (out_index)
+        *out_index = index;
+    return LC_OK;
+}
+
+lc_status array_binary_search(const array *list, const void *key, uint32_t *out_index) {
+    CHECK_NULL(list);
+    CHECK_CONDITION(list->sorted || !list->require_sorted);
+    CHECK_CONDITION(list->compare);
+    uint32_t low = 0, high = list->length; // the first that is not below the key
+    while (low < high) {
+        const uint32_t middle = low + (high - low) / 2;
+        if (list->compare(&list->elements[middle], &key) < 0)
+            low = middle + 1;
+        else
+            high = middle;
+    }
+    if (low == list->length || list->compare(&list->elements[low], &key) != 0)
+        return LC_NOT_FOUND;
+    return told(low, out_index);
+}
+lc_status array_linear_search(const array *list, const void *key, uint32_t start, uint32_t *out_index) {
+    CHECK_NULL(list);
+    CHECK_CONDITION(list->compare);
+    for (uint32_t i = start; i < list->length; i++)
+        if (list->compare(&list->elements[i], &key) == 0)
+            return told(i, out_index);
+    return LC_NOT_FOUND;
+}
+lc_status array_best_search(const array *list, const void *key, uint32_t *out_index) {
+    CHECK_NULL(list);
+    CHECK_CONDITION(list->compare);
+    if (list->sorted)
+        return array_binary_search(list, key, out_index);
+    uint32_t index = 0;
+    bool found = false;
+    if (!array_index_find(list, key, &index, &found))
+        return array_linear_search(list, key, 0, out_index);
+    return found ? told(index, out_index) : LC_NOT_FOUND;
+}
+
+// ---- Whole arrays
+
+lc_status array_duplicate(const array *list, array **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(list);
+    array_options options;
+    CHECK_STATUS(array_options_get(list, &options));
+    array *copy = nullptr;
+    CHECK_STATUS(array_new(&copy, &options));
+    lc_status status = make_room(copy, list->length);
+    for (uint32_t i = 0; i < list->length && status == LC_OK; i++) {
+        status = copy_of(list, list->elements[i], &copy->elements[i]);
+        if (status == LC_OK)
+            copy->length = i + 1;
+    }
+    copy->sorted = list->sorted;
+    if (status != LC_OK)
+        (void)array_free(&copy);
+    CHECK_STATUS(status);
+    *out = copy;
+    return LC_OK;
+}
+lc_status array_concat(array *list, array *moved) {
+    CHECK_NULL(list);
+    CHECK_NULL(moved);
+    CHECK_CONDITION(list != moved);
+    const uint64_t length = uint64_t{list->length} + moved->length;
+    CHECK_STATUS(make_room(list, length));
+    array_index_drop(moved);
+    for (uint32_t i = 0; i < moved->length; i++) {
+        list->elements[list->length++] = moved->elements[i];
+        note_order(list, list->length - 1);
+    }
+    moved->length = 0;
+    return array_empty(moved);
+}
+int array_equal(const array *a, const array *b) {
+    if (!a || !b)
+        return a == b;
+    if (a->length != b->length || !a->compare)
+        return 0;
+    for (uint32_t i = 0; i < a->length; i++)
+        if (a->compare(&a->elements[i], &b->elements[i]) != 0)
+            return 0;
+    return 1;
+}
+
+static lc_status walk(array *list, array_foreach_function function, void *data, bool deletes) {
+    CHECK_NULL(list);
+    CHECK_NULL(function);
+    lc_status result = LC_OK;
+    for (uint32_t i = 0; i < list->length;) {
+        const lc_status status = function(list, i, list->elements[i], data);
+        switch (status) {
+        case LC_OK:
+            break;
+        case LC_FOREACH_DELETE:
+            if (!deletes) {
+                LC_LOG(LC_LOG_ERR,
+                       "Array foreach callback returned lc_err_foreach_delete to delete element #%d, but "
+                       "array_foreach_delete() was not called",
+                       static_cast<int32_t>(i));
+                return LC_ASSERTION;
+            }
+            CHECK_STATUS(array_delete(list, i));
+            continue;
+        case LC_FOREACH_HALT_ERROR:
+            LC_LOG(LC_LOG_ERR, "Array element %d halted iteration with an error", static_cast<int32_t>(i));
+            return LC_GENERIC;
+        case LC_FOREACH_HALT_OK:
+        case LC_CANCELLED:
+            return LC_OK;
+        default:
+            LC_LOG(LC_LOG_WARNING, "Got return code %d from foreach function", status);
+            result = LC_GENERIC;
+        }
+        i++;
+    }
+    return result;
+}
+lc_status array_foreach(array *list, array_foreach_function function, void *data) {
+    return walk(list, function, data, false);
+}
+lc_status array_foreach_delete(array *list, array_foreach_function function, void *data) {
+    return walk(list, function, data, true);
+}

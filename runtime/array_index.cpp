@@ -1,0 +1,77 @@
+#include "runtime/array_index.h"
+
+#include <cstdlib>
+
+// Open addressing; a slot holds a position + 1, 0 for none. The table is at least twice the entries.
+struct array_index {
+    uint32_t slot_count; // a power of two
+    uint32_t indexed;    // the first so many elements stand in it
+    uint32_t key_changes;
+    uint32_t slots[];
+};
+
+constexpr uint32_t INDEX_MIN_LENGTH = 16;
+
+static uint32_t changes_now(const array *list) {
+    return list->key_changes ? list->key_changes->load(std::memory_order_relaxed) : 0;
+}
+
+void array_index_drop(const array *list) {
+    free(list->index);
+    list->index = nullptr;
+}
+
+// The slot of an equal element, or the free one where it would go.
+static uint32_t *slot_of(const array *list, const void *key) {
+    const uint32_t mask = list->index->slot_count - 1;
+    uint32_t at = list->hash(key) & mask;
+    while (list->index->slots[at]) {
+        void *const *element = &list->elements[list->index->slots[at] - 1];
+        if (list->compare(&key, element) == 0)
+            break;
+        at = (at + 1) & mask;
+    }
+    return &list->index->slots[at];
+}
+
+static bool make_index(const array *list) {
+    uint32_t count = 64;
+    while (count < 3 * uint64_t{list->length} && count < 0x40000000)
+        count *= 2;
+    if (list->length >= count / 2)
+        return false;
+    list->index =
+        static_cast<array_index *>(calloc(1, sizeof(array_index) + sizeof(uint32_t) * size_t{count}));
+    if (!list->index)
+        return false;
+    list->index->slot_count = count;
+    list->index->key_changes = changes_now(list);
+    return true;
+}
+
+static bool bring_up_to_date(const array *list) {
+    if (list->index &&
+        (list->index->key_changes != changes_now(list) || list->index->indexed > list->length ||
+         2 * uint64_t{list->length} > list->index->slot_count))
+        array_index_drop(list);
+    if (!list->index && !make_index(list))
+        return false;
+    while (list->index->indexed < list->length) {
+        const uint32_t position = list->index->indexed++;
+        if (!list->elements[position])
+            continue;
+        uint32_t *slot = slot_of(list, list->elements[position]);
+        if (!*slot)
+            *slot = position + 1;
+    }
+    return true;
+}
+
+bool array_index_find(const array *list, const void *key, uint32_t *out_position, bool *out_found) {
+    if (!list->hash || !key || list->length < INDEX_MIN_LENGTH || !bring_up_to_date(list))
+        return false;
+    const uint32_t found = *slot_of(list, key);
+    *out_found = found != 0;
+    *out_position = found - 1;
+    return true;
+}

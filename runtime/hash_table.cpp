@@ -1,0 +1,253 @@
+// The chained hash table. Buckets are singly linked; new entries go to the end of their chain. The table is
+// resized after each insertion and deletion, when it has become too full or too empty; without memory for
+// that it goes on with the buckets that it has.
+#include "runtime/hash_table.h"
+
+#include <algorithm>
+#include <cstdlib>
+#include <cstring>
+
+#include "runtime/logging.h"
+
+// ---- Hash: Jenkins' lookup2 over the key's bytes
+
+struct jenkins_state {
+    uint32_t a, b, c;
+
+    void mix() {
+        a = (a - b - c) ^ (c >> 13);
+        b = (b - c - a) ^ (a << 8);
+        c = (c - a - b) ^ (b >> 13);
+        a = (a - b - c) ^ (c >> 12);
+        b = (b - c - a) ^ (a << 16);
+        c = (c - a - b) ^ (b >> 5);
+        a = (a - b - c) ^ (c >> 3);
+        b = (b - c - a) ^ (a << 10);
+        c = (c - a - b) ^ (b >> 15);
+    }
+};
+
+static uint32_t little_endian(const uint8_t *bytes, uint32_t count) {
+    uint32_t value = 0;
+    for (uint32_t i = 0; i < std::min(count, 4u); i++)
+        value |= uint32_t{bytes[i]} << (8 * i);
+    return value;
+}
+
+uint32_t ht_bjh_hash(const void *key, uint32_t length, uint32_t initial) {
+    const auto *bytes = static_cast<const uint8_t *>(key);
+    jenkins_state state{0x9e3779b9, 0x9e3779b9, initial};
+    uint32_t rest = length;
+    for (; rest >= 12; rest -= 12, bytes += 12) {
+        state.a += little_endian(bytes, 4);
+        state.b += little_endian(bytes + 4, 4);
+        state.c += little_endian(bytes + 8, 4);
+        state.mix();
+    }
+    state.c += length; // its lowest byte is the length's, so the last bytes begin one higher
+    state.a += little_endian(bytes, rest);
+    if (rest > 4)
+        state.b += little_endian(bytes + 4, rest - 4);
+    if (rest > 8)
+        state.c += little_endian(bytes + 8, rest - 8) << 8;
+    state.mix();
+    return state.c;
+}
+uint32_t ht_hash_string_func(const void *key, uint32_t length) {
+    return ht_bjh_hash(key, length, 0x12345678);
+}
+int ht_key_equal_string_func(const void *a, uint32_t a_length, const void *b, uint32_t b_length) {
+    return a_length == b_length && memcmp(a, b, a_length) == 0;
+}
+
+// ---- Life
+
+void ht_default_options(ht_options *out) {
+    *out = ht_options{};
+    out->hash_function = ht_hash_string_func;
+    out->key_equal_function = ht_key_equal_string_func;
+}
+
+lc_status ht_new(ht **out, const ht_options *options) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    ht_options defaults;
+    ht_default_options(&defaults);
+    if (!options)
+        options = &defaults;
+    auto *table = static_cast<ht *>(calloc(1, sizeof(ht)));
+    CHECK_NULL(table);
+    table->buckets = static_cast<ht_entry **>(calloc(ht_table_size_initial, sizeof(ht_entry *)));
+    if (!table->buckets)
+        free(table);
+    else
+        *out = table;
+    CHECK_NULL(*out);
+    table->bucket_count = ht_table_size_initial;
+    table->refuse_duplicates = options->refuse_duplicates;
+    table->hash_function = options->hash_function ? options->hash_function : defaults.hash_function;
+    table->key_equal_function =
+        options->key_equal_function ? options->key_equal_function : defaults.key_equal_function;
+    table->insert_function = options->insert_function;
+    table->user_word = options->user_word;
+    table->free_function = options->free_function;
+    return LC_OK;
+}
+
+static void resize(ht *table, uint32_t bucket_count) {
+    auto **buckets = static_cast<ht_entry **>(calloc(bucket_count, sizeof(ht_entry *)));
+    if (!buckets)
+        return;
+    LC_LOG(LC_LOG_DEBUG, "resize ht from %d to %d", static_cast<int32_t>(table->bucket_count),
+           static_cast<int32_t>(bucket_count));
+    for (uint32_t i = 0; i < table->bucket_count; i++) {
+        while (ht_entry *entry = table->buckets[i]) {
+            table->buckets[i] = entry->next;
+            ht_entry **head = &buckets[table->hash_function(entry->key, entry->key_length) % bucket_count];
+            entry->next = *head;
+            *head = entry;
+        }
+    }
+    free(table->buckets);
+    table->buckets = buckets;
+    table->bucket_count = bucket_count;
+}
+
+static void fit(ht *table) {
+    const uint64_t entries = table->entry_count;
+    uint32_t buckets = table->bucket_count;
+    if (entries > uint64_t{ht_table_resize_growth_load_factor} * buckets && buckets < ht_table_size_max) {
+        resize(table, std::min(buckets * ht_table_resize_factor, ht_table_size_max));
+    } else if (buckets >
+               std::max<uint64_t>(ht_table_resize_shrink_load_factor * entries, ht_table_size_initial)) {
+        uint32_t before;
+        do {
+            before = buckets;
+            buckets /= ht_table_resize_factor;
+        } while (before >= 128 && ht_table_resize_shrink_load_factor * entries < buckets);
+        resize(table, std::max(buckets, ht_table_size_initial));
+    }
+}
+
+// Takes one entry out of its chain and frees it; it is gone whatever its free function says.
+static lc_status drop(ht *table, ht_entry **link) {
+    ht_entry *entry = *link;
+    *link = entry->next;
+    table->entry_count--;
+    lc_status status = LC_OK;
+    if (table->free_function)
+        status = table->free_function(entry->key, entry->key_length, entry->value, table->user_word);
+    free(entry);
+    return status == LC_OK ? LC_OK : LC_GENERIC;
+}
+
+static lc_status drop_all(ht *table) {
+    lc_status result = LC_OK;
+    for (uint32_t i = 0; i < table->bucket_count; i++) {
+        while (table->buckets[i]) {
+            const lc_status status = drop(table, &table->buckets[i]);
+            if (status != LC_OK)
+                result = status;
+        }
+    }
+    return result;
+}
+lc_status ht_empty(ht *table) {
+    CHECK_NULL(table);
+    const lc_status status = drop_all(table);
+    fit(table);
+    CHECK_STATUS(status);
+    return LC_OK;
+}
+lc_status ht_free(ht **inout) {
+    CHECK_NULL(inout);
+    ht *table = *inout;
+    *inout = nullptr;
+    if (!table)
+        return LC_OK;
+    const lc_status status = drop_all(table);
+    free(table->buckets);
+    free(table);
+    CHECK_STATUS(status);
+    return LC_OK;
+}
+
+// ---- Entries
+
+static uint32_t length_of(const void *key, int32_t key_length) {
+    return key_length < 0 ? static_cast<uint32_t>(strlen(static_cast<const char *>(key)))
+                          : static_cast<uint32_t>(key_length);
+}
+
+// The link to the entry of this key, or to the null at the end of its chain.
+static ht_entry **find(const ht *table, const void *key, uint32_t length) {
+    ht_entry **link = &table->buckets[table->hash_function(key, length) % table->bucket_count];
+    while (*link && !table->key_equal_function((*link)->key, (*link)->key_length, key, length))
+        link = &(*link)->next;
+    return link;
+}
+
+lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value) {
+    CHECK_NULL(table);
+    CHECK_NULL(key);
+    const uint32_t length = length_of(key, key_length);
+    ht_entry **link = find(table, key, length);
+    if (*link && table->refuse_duplicates)
+        return LC_EXISTS;
+    auto *entry = static_cast<ht_entry *>(calloc(1, sizeof(ht_entry)));
+    CHECK_NULL(entry);
+    *entry = {const_cast<void *>(key), length, value, nullptr};
+    if (table->insert_function) {
+        const lc_status status =
+            table->insert_function(key, length, value, table->user_word, &entry->key, &entry->value);
+        if (status != LC_OK)
+            free(entry);
+        CHECK_STATUS(status);
+    }
+    lc_status old_status = LC_OK;
+    if (*link)
+        old_status = drop(table, link);
+    while (*link)
+        link = &(*link)->next;
+    *link = entry;
+    table->entry_count++;
+    fit(table);
+    LOG_STATUS(old_status); // the old entry is gone and the new one stands
+    return LC_OK;
+}
+lc_status ht_lookup(const ht *table, const void *key, int32_t key_length, int *out_found, void **out_key,
+                    int32_t *out_key_length, void **out_value) {
+    if (out_found)
+        *out_found = 0;
+    if (out_key)
+        *out_key = nullptr;
+    if (out_key_length)
+        *out_key_length = -1;
+    if (out_value)
+        *out_value = nullptr;
+    CHECK_NULL(table);
+    CHECK_NULL(key);
+    const ht_entry *entry = *find(table, key, length_of(key, key_length));
+    if (!entry)
+        return LC_OK;
+    if (out_found)
+        *out_found = 1;
+    if (out_key)
+        *out_key = entry->key;
+    if (out_key_length)
+        *out_key_length = static_cast<int32_t>(entry->key_length);
+    if (out_value)
+        *out_value = entry->value;
+    return LC_OK;
+}
+lc_status ht_delete(ht *table, const void *key, int32_t key_length) {
+    CHECK_NULL(table);
+    CHECK_NULL(key);
+    ht_entry **link = find(table, key, length_of(key, key_length));
+    if (!*link)
+        return LC_OK;
+    const lc_status status = drop(table, link);
+    fit(table);
+    CHECK_STATUS(status);
+    return LC_OK;
+}

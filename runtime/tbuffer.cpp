@@ -1,0 +1,401 @@
+// Growable byte buffers. One byte more than `size` is allocated, so that the NUL behind the last byte has its
+// place in a full buffer; fresh memory is zero, so that a length set over it shows zero bytes and never what
+// lay there before. Counts that a reader takes from the bytes are bounded by the bytes that follow them.
+#include "runtime/tbuffer.h"
+
+#include <algorithm>
+#include <cstdlib>
+#include <cstring>
+
+#include "runtime/byte_order.h"
+#include "runtime/guards.h"
+#include "runtime/logging.h"
+#include "runtime/tstr_array.h"
+
+// ---- Size
+
+static uint64_t rounded(uint64_t size) {
+    const uint64_t mask = size >= tb_size_chunk_size_mask + 1 ? tb_size_chunk_size_mask : tb_size_initial - 1;
+    return std::min<uint64_t>((size + mask) & ~mask, tb_size_max);
+}
+
+static uint64_t size_for(const tbuffer *buffer, uint64_t need) {
+    uint64_t size = buffer->size;
+    if (size < need) {
+        size = uint64_t{std::max(buffer->size, tb_size_initial)} * tb_size_growth_factor;
+        size = std::max(size, need);
+        size = rounded(std::min(size, need + tb_size_max_extra_growth));
+    }
+    if (buffer->auto_shrink && size > (need * 3 + 3) * 2 + 1)
+        size = rounded(need);
+    return size;
+}
+
+static lc_status fit(tbuffer *buffer, uint64_t need) {
+    CHECK_CONDITION(!buffer->constant);
+    need = std::max<uint64_t>(need, tb_size_initial);
+    if (need > tb_size_max) {
+        LC_LOG(LC_LOG_ERR, "maximum size exceeded: %d",
+               static_cast<int32_t>(std::min<uint64_t>(need, INT32_MAX)));
+        return LC_ASSERTION;
+    }
+    const uint64_t size = size_for(buffer, need);
+    if (size == buffer->size)
+        return LC_OK;
+    auto *bytes = static_cast<uint8_t *>(realloc(buffer->buffer, size + 1));
+    CHECK_NULL(bytes);
+    if (size > buffer->size)
+        memset(bytes + buffer->size, 0, size + 1 - buffer->size);
+    buffer->buffer = bytes;
+    buffer->size = static_cast<uint32_t>(size);
+    return LC_OK;
+}
+
+static void ended(tbuffer *buffer, uint32_t length) {
+    buffer->length = length;
+    buffer->buffer[length] = 0;
+}
+
+// ---- Life
+
+lc_status tb_new_size(tbuffer **out, uint32_t size) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    owned<tbuffer, tb_release> buffer(static_cast<tbuffer *>(calloc(1, sizeof(tbuffer))));
+    CHECK_NULL(buffer.pointer);
+    size = std::max(size, tb_size_initial);
+    if (size > tb_size_max) {
+        LC_LOG(LC_LOG_ERR, "maximum size exceeded: %d", static_cast<int32_t>(std::min(size, 0x7fffffffu)));
+        return LC_ASSERTION;
+    }
+    const uint64_t allocated = rounded(size);
+    buffer.pointer->buffer = static_cast<uint8_t *>(calloc(1, allocated + 1));
+    CHECK_NULL(buffer.pointer->buffer);
+    buffer.pointer->size = static_cast<uint32_t>(allocated);
+    *out = buffer.take();
+    return LC_OK;
+}
+lc_status tb_new(tbuffer **out) {
+    return tb_new_size(out, tb_size_initial);
+}
+lc_status tb_new_buf(tbuffer **out, const void *bytes, int32_t length) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(bytes);
+    const size_t count = length < 0 ? strlen(static_cast<const char *>(bytes)) : static_cast<size_t>(length);
+    CHECK_CONDITION(count < tb_size_max);
+    owned<tbuffer, tb_release> buffer;
+    CHECK_STATUS(tb_new_size(&buffer.pointer, static_cast<uint32_t>(count) + 1));
+    CHECK_STATUS(tb_append_buf(buffer.pointer, bytes, static_cast<uint32_t>(count)));
+    *out = buffer.take();
+    return LC_OK;
+}
+lc_status tb_new_takeover(tbuffer **out, uint8_t **inout_bytes, uint32_t length, uint32_t size) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(inout_bytes);
+    CHECK_NULL(*inout_bytes);
+    CHECK_CONDITION(length <= size && size <= tb_size_max);
+    owned<tbuffer, tb_release> buffer(static_cast<tbuffer *>(calloc(1, sizeof(tbuffer))));
+    CHECK_NULL(buffer.pointer);
+    auto *bytes = static_cast<uint8_t *>(realloc(*inout_bytes, size_t{size} + 1));
+    CHECK_NULL(bytes);
+    *inout_bytes = nullptr;
+    buffer.pointer->buffer = bytes;
+    buffer.pointer->size = size;
+    ended(buffer.pointer, length);
+    *out = buffer.take();
+    return LC_OK;
+}
+lc_status tb_new_buf_const(tbuffer **out, const void *bytes, uint32_t length) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(bytes);
+    auto *buffer = static_cast<tbuffer *>(calloc(1, sizeof(tbuffer)));
+    CHECK_NULL(buffer);
+    buffer->buffer = static_cast<uint8_t *>(const_cast<void *>(bytes));
+    buffer->length = buffer->size = length;
+    buffer->constant = 1;
+    *out = buffer;
+    return LC_OK;
+}
+lc_status tb_free(tbuffer **inout) {
+    CHECK_NULL(inout);
+    if (*inout) {
+        if (!(*inout)->constant)
+            free((*inout)->buffer);
+        free(*inout);
+    }
+    *inout = nullptr;
+    return LC_OK;
+}
+lc_status tb_detach(tbuffer **inout, uint8_t **out_bytes, uint32_t *out_length) {
+    CHECK_NULL(inout);
+    CHECK_NULL(*inout);
+    CHECK_NULL(out_bytes);
+    CHECK_CONDITION(!(*inout)->constant);
+    *out_bytes = (*inout)->buffer;
+    if (out_length)
+        *out_length = (*inout)->length;
+    free(*inout);
+    *inout = nullptr;
+    return LC_OK;
+}
+lc_status tb_dup(const tbuffer *buffer, tbuffer **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(buffer);
+    CHECK_CONDITION(buffer->length < tb_size_max);
+    owned<tbuffer, tb_release> copy;
+    CHECK_STATUS(tb_new_size(&copy.pointer, buffer->length + 1));
+    CHECK_STATUS(tb_append_buf(copy.pointer, buffer->buffer, buffer->length));
+    copy.pointer->auto_shrink = buffer->auto_shrink;
+    *out = copy.take();
+    return LC_OK;
+}
+lc_status tb_set_auto_shrink(tbuffer *buffer, int on) {
+    CHECK_NULL(buffer);
+    buffer->auto_shrink = on ? 1 : 0;
+    return on ? fit(buffer, uint64_t{buffer->length} + 1) : LC_OK;
+}
+
+// ---- Plain access
+
+int32_t tb_length(const tbuffer *buffer) {
+    return buffer ? static_cast<int32_t>(buffer->length) : -1;
+}
+uint32_t tb_size(const tbuffer *buffer) {
+    return buffer ? buffer->size : 0;
+}
+uint32_t tb_avail(const tbuffer *buffer) {
+    return buffer ? buffer->size - buffer->length : 0;
+}
+uint8_t *tb_buf_maybe(const tbuffer *buffer) {
+    return buffer ? buffer->buffer : nullptr;
+}
+uint8_t *tb_buf(const tbuffer *buffer) {
+    if (!buffer)
+        (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);
+    return tb_buf_maybe(buffer);
+}
+lc_status tb_ensure_size(tbuffer *buffer, uint32_t size) {
+    CHECK_NULL(buffer);
+    return size > buffer->size ? fit(buffer, size) : LC_OK;
+}
+lc_status tb_set_length(tbuffer *buffer, uint32_t length) {
+    CHECK_NULL(buffer);
+    CHECK_CONDITION(!buffer->constant);
+    if (length > buffer->size)
+        FAIL_WITH(LC_GENERIC);
+    const bool shorter = length < buffer->length;
+    ended(buffer, length);
+    return shorter ? fit(buffer, uint64_t{length} + 1) : LC_OK;
+}
+lc_status tb_clear(tbuffer *buffer) {
+    return tb_set_length(buffer, 0);
+}
+lc_status tb_delete_bytes(tbuffer *buffer, uint32_t offset, uint32_t count) {
+    CHECK_NULL(buffer);
+    CHECK_CONDITION(!buffer->constant);
+    if (offset > buffer->length || count > buffer->length - offset)
+        FAIL_WITH(LC_NO_BUFFER_SPACE);
+    memmove(buffer->buffer + offset, buffer->buffer + offset + count, buffer->length - offset - count);
+    return tb_set_length(buffer, buffer->length - count);
+}
+
+// ---- Writing
+
+lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t count) {
+    CHECK_NULL(buffer);
+    CHECK_CONDITION(!buffer->constant);
+    if (count)
+        CHECK_NULL(bytes);
+    const uint64_t end = uint64_t{offset} + count;
+    if (end > buffer->length) {
+        if (end + 1 > buffer->size) {
+            const auto *source = static_cast<const uint8_t *>(bytes);
+            CHECK_CONDITION(source < buffer->buffer || source >= buffer->buffer + buffer->size);
+            CHECK_QUIET(fit(buffer, end + 1));
+        }
+        if (offset > buffer->length)
+            memset(buffer->buffer + buffer->length, 0, offset - buffer->length);
+    }
+    if (count)
+        memmove(buffer->buffer + offset, bytes, count);
+    if (end > buffer->length)
+        ended(buffer, static_cast<uint32_t>(end));
+    return LC_OK;
+}
+lc_status tb_append_buf(tbuffer *buffer, const void *bytes, uint32_t count) {
+    CHECK_NULL(buffer);
+    return tb_put_buf(buffer, buffer->length, bytes, count);
+}
+lc_status tb_put_byte(tbuffer *buffer, uint32_t offset, uint8_t byte) {
+    return tb_put_buf(buffer, offset, &byte, 1);
+}
+
+static lc_status get_number(const tbuffer *buffer, uint32_t offset, void *out, uint32_t size) {
+    CHECK_NULL(out);
+    memset(out, 0, size);
+    CHECK_NULL(buffer);
+    CHECK_CONDITION(offset <= buffer->length && size <= buffer->length - offset);
+    memcpy(out, buffer->buffer + offset, size);
+    return LC_OK;
+}
+
+#define TB_NUMBER(width)                                                                                     \
+    lc_status tb_put_uint##width(tbuffer *buffer, uint32_t offset, uint##width##_t value) {                  \
+        return tb_put_buf(buffer, offset, &value, sizeof value);                                             \
+    }                                                                                                        \
+    lc_status tb_append_uint##width(tbuffer *buffer, uint##width##_t value) {                                \
+        return tb_append_buf(buffer, &value, sizeof value);                                                  \
+    }                                                                                                        \
+    lc_status tb_get_uint##width(const tbuffer *buffer, uint32_t offset, uint##width##_t *out) {             \
+        return get_number(buffer, offset, out, sizeof *out);                                                 \
+    }
+TB_NUMBER(8)
+TB_NUMBER(16)
+TB_NUMBER(32)
+TB_NUMBER(64)
+lc_status tb_get_uint128(const tbuffer *buffer, uint32_t offset, uint8_t out[16]) {
+    return get_number(buffer, offset, out, 16);
+}
+
+// ---- Strings
+
+static uint32_t in_order(uint32_t number, int swap) {
+    return swap ? raw_word(to_be32(number)) : number;
+}
+
+static lc_status put_text(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
+                          const char *text, uint32_t length, uint32_t *out_written) {
+    CHECK_CONDITION(length < tb_size_max && offset < tb_size_max);
+    const uint32_t counted = length + (add_nul ? 1 : 0);
+    uint32_t at = offset;
+    if (length_word) {
+        CHECK_STATUS(tb_put_uint32(buffer, at, in_order(counted, swap)));
+        at += 4;
+    }
+    CHECK_STATUS(tb_put_buf(buffer, at, text, length));
+    if (add_nul)
+        CHECK_STATUS(tb_put_byte(buffer, at + length, 0));
+    if (out_written)
+        *out_written = at + counted - offset;
+    return LC_OK;
+}
+lc_status tb_put_str(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
+                     const char *text, int32_t length, uint32_t *out_written) {
+    if (out_written)
+        *out_written = 0;
+    CHECK_NULL(buffer);
+    CHECK_NULL(text);
+    const size_t bytes = length < 0 ? strlen(text) : static_cast<size_t>(length);
+    CHECK_CONDITION(bytes < tb_size_max);
+    return put_text(buffer, offset, add_nul, length_word, swap, text, static_cast<uint32_t>(bytes),
+                    out_written);
+}
+lc_status tb_put_tstr(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
+                      const tstring *string, uint32_t *out_written) {
+    const char *text = string ? string->buffer : "";
+    return tb_put_str(buffer, offset, add_nul, length_word, swap, text, string ? string->length : 0,
+                      out_written);
+}
+lc_status tb_append_tstr(tbuffer *buffer, int add_nul, int length_word, int swap, const tstring *string) {
+    CHECK_NULL(buffer);
+    return tb_put_tstr(buffer, buffer->length, add_nul, length_word, swap, string, nullptr);
+}
+lc_status tb_put_tstr_array(tbuffer *buffer, uint32_t offset, int add_nul, int swap, const tstr_array *array,
+                            uint32_t *out_written) {
+    if (out_written)
+        *out_written = 0;
+    const uint32_t count = tstr_array_length_quick(array);
+    CHECK_STATUS(tb_put_uint32(buffer, offset, in_order(count, swap)));
+    uint32_t at = offset + 4;
+    for (uint32_t i = 0; i < count; i++) {
+        uint32_t written = 0;
+        CHECK_STATUS(tb_put_tstr(buffer, at, add_nul, 1, swap, tstr_array_get_quick(array, i), &written));
+        at += written;
+    }
+    if (out_written)
+        *out_written = at - offset;
+    return LC_OK;
+}
+lc_status tb_append_tstr_array(tbuffer *buffer, int add_nul, int swap, const tstr_array *array) {
+    CHECK_NULL(buffer);
+    return tb_put_tstr_array(buffer, buffer->length, add_nul, swap, array, nullptr);
+}
+
+// Where the text lies and how long it is, NUL excluded; `out_used` counts from `offset`.
+static lc_status find_text(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul,
+                           int length_word, int swap, uint32_t *out_start, uint32_t *out_length,
+                           uint32_t *out_used) {
+    CHECK_NULL(buffer);
+    uint32_t start = offset, counted;
+    if (length_word) {
+        CHECK_STATUS(tb_get_uint32(buffer, offset, &counted));
+        counted = in_order(counted, swap);
+        start += 4;
+    } else {
+        CHECK_CONDITION(offset <= buffer->length);
+        counted = length < 0 ? buffer->length - offset : static_cast<uint32_t>(length);
+    }
+    if (start > buffer->length || counted > buffer->length - start)
+        FAIL_WITH(LC_NO_BUFFER_SPACE);
+    if (expect_nul)
+        CHECK_CONDITION(counted > 0 && buffer->buffer[start + counted - 1] == 0);
+    *out_start = start;
+    *out_length = counted - (expect_nul ? 1 : 0);
+    if (out_used)
+        *out_used = start + counted - offset;
+    return LC_OK;
+}
+lc_status tb_get_str(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
+                     int swap, char **out_text, uint32_t *out_length, uint32_t *out_used) {
+    CHECK_NULL(out_text);
+    *out_text = nullptr;
+    uint32_t start = 0, bytes = 0;
+    CHECK_STATUS(find_text(buffer, offset, length, expect_nul, length_word, swap, &start, &bytes, out_used));
+    auto *text = static_cast<char *>(malloc(size_t{bytes} + 1));
+    CHECK_NULL(text);
+    memcpy(text, buffer->buffer + start, bytes);
+    text[bytes] = 0;
+    *out_text = text;
+    if (out_length)
+        *out_length = bytes;
+    return LC_OK;
+}
+lc_status tb_get_tstr(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
+                      int swap, tstring **out, uint32_t *out_used) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    owned_text text;
+    uint32_t bytes = 0;
+    CHECK_STATUS(
+        tb_get_str(buffer, offset, length, expect_nul, length_word, swap, &text.pointer, &bytes, out_used));
+    CHECK_STATUS(ts_new_str_takeover(out, &text.pointer, static_cast<int32_t>(bytes), -1));
+    return LC_OK;
+}
+lc_status tb_get_tstr_array(const tbuffer *buffer, uint32_t offset, int expect_nul, int swap,
+                            tstr_array **out, uint32_t *out_used) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    uint32_t count = 0;
+    CHECK_STATUS(tb_get_uint32(buffer, offset, &count));
+    count = in_order(count, swap);
+    uint32_t at = offset + 4;
+    if (count > (buffer->length - at) / 4) // each string has a length word
+        FAIL_WITH(LC_NO_BUFFER_SPACE);
+    owned<tstr_array, tstr_array_release> array;
+    CHECK_STATUS(tstr_array_new(&array.pointer, nullptr));
+    for (uint32_t i = 0; i < count; i++) {
+        owned<tstring, ts_release> string;
+        uint32_t used = 0;
+        CHECK_STATUS(tb_get_tstr(buffer, at, -1, expect_nul, 1, swap, &string.pointer, &used));
+        CHECK_STATUS(tstr_array_append_takeover(array.pointer, &string.pointer));
+        at += used;
+    }
+    *out = array.take();
+    if (out_used)
+        *out_used = at - offset;
+    return LC_OK;
+}

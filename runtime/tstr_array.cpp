@@ -1,0 +1,86 @@
+#include "runtime/tstr_array.h"
+
+#include <cstring>
+
+#include "runtime/guards.h"
+
+static lc_status dup_for_array(const void *element, void **out_copy) {
+    tstring *copy = nullptr;
+    CHECK_STATUS(ts_dup(static_cast<const tstring *>(element), &copy));
+    *out_copy = copy;
+    return LC_OK;
+}
+static void free_for_array(void *element) {
+    ts_release(static_cast<tstring *>(element));
+}
+static int compare_for_array(const void *a, const void *b) {
+    return ts_cmp(*static_cast<const tstring *const *>(a), *static_cast<const tstring *const *>(b));
+}
+static void string_options(array_options *options) {
+    options->compare = compare_for_array;
+    options->duplicate = dup_for_array;
+    options->free = free_for_array;
+}
+TYPED_ARRAY_DEFINE(tstr_array, tstring *, string_options)
+
+lc_status tstr_array_new(tstr_array **out, const tstr_array_options *options) {
+    array_options all;
+    CHECK_STATUS(array_options_get_defaults(&all));
+    string_options(&all);
+    if (options)
+        all.duplicate_policy = options->duplicate_policy;
+    return tstr_array_new_full(out, &all);
+}
+
+lc_status tstr_array_get_str(const tstr_array *array, uint32_t index, const char **out_text) {
+    CHECK_NULL(out_text);
+    *out_text = nullptr;
+    tstring *string = nullptr;
+    CHECK_QUIET(tstr_array_get(array, index, &string));
+    *out_text = ts_str_maybe(string);
+    return LC_OK;
+}
+const char *tstr_array_get_str_quick(const tstr_array *array, uint32_t index) {
+    return ts_str_maybe(tstr_array_get_quick(array, index));
+}
+lc_status tstr_array_append_str(tstr_array *array, const char *text) {
+    owned<tstring, ts_release> string;
+    CHECK_STATUS(ts_new_str(&string.pointer, text));
+    return tstr_array_append_takeover(array, &string.pointer);
+}
+lc_status tstr_array_append_str_takeover(tstr_array *array, char **inout_text) {
+    CHECK_NULL(array);
+    owned<tstring, ts_release> string;
+    CHECK_STATUS(ts_new_str_takeover(&string.pointer, inout_text, -1, -1));
+    const lc_status status = tstr_array_append_takeover(array, &string.pointer);
+    if (status != LC_OK && string.pointer) // the text stays the caller's
+        LOG_STATUS(ts_detach(&string.pointer, inout_text, nullptr));
+    return status;
+}
+lc_status tstr_array_insert_str(tstr_array *array, uint32_t index, const char *text) {
+    owned<tstring, ts_release> string;
+    CHECK_STATUS(ts_new_str(&string.pointer, text));
+    return tstr_array_insert_takeover(array, index, &string.pointer);
+}
+
+lc_status tstr_array_wildcard_match(const tstr_array *pattern, const tstr_array *parts, int *out_matched) {
+    CHECK_NULL(out_matched);
+    *out_matched = 0;
+    const uint32_t pattern_count = tstr_array_length_quick(pattern);
+    const uint32_t count = tstr_array_length_quick(parts);
+    if (pattern_count == 0 || count == 0) {
+        *out_matched = pattern_count == count;
+        return LC_OK;
+    }
+    if (pattern_count > count)
+        return LC_OK;
+    for (uint32_t i = 0; i < pattern_count; i++) {
+        const tstring *wanted = tstr_array_get_quick(pattern, i);
+        if (ts_equal(wanted, tstr_array_get_quick(parts, i)) || ts_equal_str(wanted, "*", 0))
+            continue;
+        *out_matched = ts_equal_str(wanted, "**", 0);
+        return LC_OK;
+    }
+    *out_matched = pattern_count == count;
+    return LC_OK;
+}
