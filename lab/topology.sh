@@ -229,14 +229,19 @@ lab_wait_line() { # SECONDS EXPRESSION FILE
     done
 }
 
-# Writes what passes the bridge to a file until the lab ends or lab_capture_end.
+# Writes what passes the bridge to a file until the lab ends or lab_capture_end. tcpdump wants to change its user and
+# groups, which a user namespace of an ordinary user refuses: dumpcap, which comes with tshark, does it there.
 lab_capture() { # FILE
-    tcpdump -i lan --immediate-mode -U -Z root -w "$1" udp port 2048 </dev/null >"$LAB/tcpdump.out" 2>&1 &
+    local with=(tcpdump -i lan --immediate-mode -U -Z root -w "$1" udp port 2048) said='listening on'
+    if [ "$(cat /proc/self/setgroups)" = deny ]; then
+        with=(dumpcap -q -P -i lan -f 'udp port 2048' -w "$1") said='Capturing on'
+    fi
+    "${with[@]}" </dev/null >"$LAB/capture.out" 2>&1 &
     LAB_CAPTURE=$!
-    lab_wait_line 10 'listening on' "$LAB/tcpdump.out"
+    lab_wait_line 20 "$said" "$LAB/capture.out" || { cat "$LAB/capture.out" >&2; return 1; }
 }
 lab_capture_end() {
-    sleep 0.3
+    sleep 1.2
     kill -INT "$LAB_CAPTURE"; wait "$LAB_CAPTURE"
 }
 
