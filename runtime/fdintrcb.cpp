@@ -7,7 +7,6 @@
 #include "runtime/fdintrcb.h"
 
 #include <cstdlib>
-#include <cstring>
 
 #include "runtime/guards.h"
 #include "runtime/logging.h"
@@ -19,25 +18,6 @@ struct fdic {
     fdic_event_array *current;
     fdic_event_array *reported;
 };
-
-static int compare_ids(const void *a, const void *b) {
-    const uint32_t first = (*static_cast<fdic_event *const *>(a))->id;
-    const uint32_t second = (*static_cast<fdic_event *const *>(b))->id;
-    return first < second ? -1 : first > second;
-}
-static lc_status fdic_event_dup_for_array(const void *element, void **out_copy) {
-    *out_copy = malloc(sizeof(fdic_event));
-    CHECK_NULL(*out_copy);
-    memcpy(*out_copy, element, sizeof(fdic_event));
-    return LC_OK;
-}
-static void fill_options(array_options *options) {
-    options->compare = compare_ids;
-    options->duplicate = fdic_event_dup_for_array;
-    options->free = free;
-    options->duplicate_policy = array_dup_replace;
-}
-TYPED_ARRAY_DEFINE(fdic_event_array, fdic_event *, fill_options)
 
 using owned_events = owned<fdic_event_array, fdic_event_array_release>;
 

@@ -1,0 +1,263 @@
+// Interest lists and the bridge that carries their changes into the loop.
+#include <functional>
+#include <vector>
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include "runtime/event_fdintrcb.h"
+#include "tests/support/gcl_log.h"
+
+namespace {
+
+void *word(uintptr_t value) {
+    return reinterpret_cast<void *>(value);
+}
+
+// ---- The list alone
+
+struct change {
+    uint32_t id;
+    int active;
+    bool operator==(const change &) const = default;
+};
+struct FdicList : testing::Test {
+    fdic *list = nullptr;
+    std::vector<std::vector<change>> told;
+    static lc_status take(const fdic_event_array *changes, void *data) {
+        auto *self = static_cast<FdicList *>(data);
+        self->told.emplace_back();
+        for (uint32_t i = 0; i < fdic_event_array_length_quick(changes); i++) {
+            const fdic_event *event = fdic_event_array_get_quick(changes, i);
+            self->told.back().push_back({event->id, event->active});
+        }
+        return LC_OK;
+    }
+    void SetUp() override { ASSERT_EQ(fdic_init(&list, take, this), LC_OK); }
+    void TearDown() override {
+        EXPECT_EQ(fdic_deinit(&list), LC_OK);
+        EXPECT_EQ(list, nullptr);
+    }
+    int32_t add_fd(int fd, int want_read, int want_write) {
+        int32_t id = -5;
+        EXPECT_EQ(fdic_event_add_fd(list, fd, want_read, want_write, nullptr, nullptr, nullptr, nullptr,
+                                    nullptr, &id),
+                  LC_OK);
+        return id;
+    }
+    std::vector<change> last() {
+        std::vector<change> out = told.empty() ? std::vector<change>() : told.back();
+        told.clear();
+        return out;
+    }
+};
+
+TEST_F(FdicList, EachChangeIsToldOnce) {
+    gcl_log log;
+    const int32_t first = add_fd(10, 1, 0);
+    EXPECT_EQ(first, 1);
+    EXPECT_EQ(last(), (std::vector<change>{{1, 1}}));
+    EXPECT_EQ(fdic_event_update_fd(list, first, 1, 0), LC_OK); // nothing new
+    EXPECT_TRUE(told.empty());
+    EXPECT_EQ(fdic_event_update_fd(list, first, 1, 1), LC_OK);
+    EXPECT_EQ(last(), (std::vector<change>{{1, 1}}));
+    add_fd(-1, 1, 1);
+    EXPECT_TRUE(told.empty());
+    const int32_t third = add_fd(11, 0, 0); // no interest, but a descriptor
+    EXPECT_EQ(last(), (std::vector<change>{{3, 1}}));
+    EXPECT_EQ(fdic_event_delete_fd(list, first), LC_OK);
+    EXPECT_EQ(last(), (std::vector<change>{{1, 0}}));
+    EXPECT_EQ(fdic_event_delete_fd(list, first), LC_NOT_FOUND);
+    EXPECT_EQ(fdic_event_update_fd(list, 2, 1, 1), LC_NOT_FOUND);
+    EXPECT_EQ(fdic_event_delete_fd(list, -1), LC_NOT_FOUND);
+    EXPECT_TRUE(told.empty());
+    EXPECT_EQ(log.count("Asked to update event fd with bad id 1"), 1);
+    EXPECT_EQ(log.count("Asked to update event fd with bad id 2"), 1);
+    EXPECT_EQ(log.count("Asked to update event fd with bad id -1"), 1);
+    EXPECT_EQ(fdic_event_delete_fd(list, third), LC_OK);
+}
+
+TEST_F(FdicList, Timers) {
+    gcl_log log;
+    int32_t id = 0;
+    EXPECT_EQ(fdic_event_add_timer(list, -7, word(0x10), nullptr, nullptr, &id),
+              LC_OK); // not armed: no interest
+    EXPECT_TRUE(told.empty());
+    EXPECT_EQ(log.count("EVENT: adding for 0x10: -1 ms"), 1);
+    EXPECT_EQ(fdic_event_add_timer(list, 50, nullptr, nullptr, nullptr, &id), LC_OK);
+    EXPECT_EQ(last(), (std::vector<change>{{2, 1}}));
+    EXPECT_EQ(fdic_event_update_timer(list, id, 50), LC_OK);
+    EXPECT_TRUE(told.empty());
+    EXPECT_EQ(fdic_event_update_timer(list, id, 60), LC_OK);
+    EXPECT_EQ(last(), (std::vector<change>{{2, 1}}));
+    EXPECT_EQ(fdic_event_delete_timer(list, id), LC_OK);
+    EXPECT_EQ(last(), (std::vector<change>{{2, 0}}));
+    EXPECT_EQ(fdic_event_delete_timer(list, id), LC_NOT_FOUND);
+    EXPECT_EQ(log.count("Asked to delete event timer with bad id 2"), 1);
+}
+
+TEST_F(FdicList, TheQueryIsACopyInOrder) {
+    for (int fd = 20; fd < 60; fd++)
+        add_fd(fd, fd % 2, 1);
+    EXPECT_EQ(fdic_event_delete_fd(list, 7), LC_OK);
+    fdic_event_array *events = nullptr;
+    ASSERT_EQ(fdic_events_query(list, &events), LC_OK);
+    ASSERT_EQ(fdic_event_array_length_quick(events), 39u);
+    for (uint32_t i = 0; i < 39; i++) {
+        const fdic_event *event = fdic_event_array_get_quick(events, i);
+        EXPECT_EQ(event->id, i < 6 ? i + 1 : i + 2);
+        EXPECT_EQ(event->fd, static_cast<int>(event->id) + 19);
+        EXPECT_EQ(event->want_read, event->fd % 2);
+    }
+    fdic_event_array_get_quick(events, 0)->fd = 1000;
+    EXPECT_EQ(fdic_event_array_free(&events), LC_OK);
+    told.clear();
+    EXPECT_EQ(fdic_event_update_fd(list, 2, 0, 1), LC_OK);
+    EXPECT_EQ(last(), (std::vector<change>{{2, 1}}));
+}
+
+// ---- With the bridge
+
+struct FdicBridge : testing::Test {
+    lew *wrapper = nullptr;
+    fdic_libevent *bridge = nullptr;
+    fdic *list = nullptr;
+    int ends[2] = {-1, -1};
+    std::vector<std::string> calls;
+    std::function<lc_status(uint32_t)> on_call;
+
+    static lc_status called(int fd, uint32_t kind, void *user_data, void *argument) {
+        auto *self = static_cast<FdicBridge *>(user_data);
+        EXPECT_TRUE(kind == FDIC_TIMER_EXPIRED ? fd == -1 : fd == self->ends[0]);
+        self->calls.push_back(std::to_string(kind) + ":" +
+                              std::to_string(reinterpret_cast<uintptr_t>(argument)));
+        return self->on_call ? self->on_call(kind) : LC_OK;
+    }
+    void SetUp() override {
+        loop_context *loop = nullptr;
+        ASSERT_EQ(lew_init(&wrapper), LC_OK);
+        ASSERT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
+        ASSERT_EQ(fdic_libevent_init(loop, &bridge), LC_OK);
+        ASSERT_EQ(fdic_init(&list, fdic_libevent_callback, bridge), LC_OK);
+        ASSERT_EQ(fdic_libevent_set_fd_close_handler(bridge, called, word(55)), LC_OK);
+        ASSERT_EQ(fdic_libevent_set_fd_open_handler(bridge, called, word(44)), LC_OK);
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, ends), 0);
+    }
+    void TearDown() override {
+        EXPECT_EQ(fdic_libevent_deinit(&bridge), LC_OK);
+        EXPECT_EQ(fdic_deinit(&list), LC_OK);
+        EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
+        close(ends[0]);
+        close(ends[1]);
+    }
+    int32_t add(int want_read, int want_write) {
+        int32_t id = 0;
+        EXPECT_EQ(fdic_event_add_fd(list, ends[0], want_read, want_write, this, called, word(1), called,
+                                    word(2), &id),
+                  LC_OK);
+        return id;
+    }
+    std::vector<std::string> round() {
+        calls.clear();
+        EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
+        return calls;
+    }
+    using list_of = std::vector<std::string>;
+};
+
+TEST_F(FdicBridge, InterestsFollowTheirChanges) {
+    const int32_t id = add(1, 0);
+    EXPECT_EQ(calls, (list_of{"4:44"}));
+    ASSERT_EQ(write(ends[1], "x", 1), 1);
+    EXPECT_EQ(round(), (list_of{"1:1"}));
+    EXPECT_EQ(fdic_event_update_fd(list, id, 0, 1), LC_OK);
+    EXPECT_EQ(round(), (list_of{"2:2"}));
+    EXPECT_EQ(fdic_event_update_fd(list, id, 1, 1), LC_OK);
+    EXPECT_EQ(round(), (list_of{"1:1", "2:2"}));
+    calls.clear();
+    EXPECT_EQ(fdic_event_delete_fd(list, id), LC_OK);
+    EXPECT_EQ(calls, (list_of{"5:55"}));
+    int none = 0;
+    EXPECT_EQ(lew_dispatch(wrapper, &none, nullptr), LC_OK);
+    EXPECT_EQ(none, 1);
+}
+
+TEST_F(FdicBridge, AnInterestThatDeletesItselfIsStillWritten) {
+    const int32_t id = add(1, 1);
+    ASSERT_EQ(write(ends[1], "x", 1), 1);
+    on_call = [&](uint32_t kind) {
+        if (kind == FDIC_READABLE) {
+            EXPECT_EQ(fdic_event_delete_fd(list, id), LC_OK);
+        }
+        return LC_OK;
+    };
+    EXPECT_EQ(round(), (list_of{"1:1", "5:55", "2:2"}));
+}
+
+TEST_F(FdicBridge, AFailureEndsTheHandlerForThisFiring) {
+    gcl_log log;
+    add(1, 1);
+    ASSERT_EQ(write(ends[1], "x", 1), 1);
+    on_call = [](uint32_t) { return LC_BAD_TYPE; };
+    EXPECT_EQ(round(), (list_of{"1:1"}));
+    EXPECT_EQ(log.count("14020"), 1);
+    on_call = [](uint32_t) { return LC_CANCELLED; };
+    EXPECT_EQ(round(), (list_of{"1:1"}));
+    EXPECT_EQ(log.count("14120"), 0);
+}
+
+TEST_F(FdicBridge, TimersFireOnce) {
+    int32_t id = 0;
+    ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, word(3), &id), LC_OK);
+    EXPECT_TRUE(calls.empty());
+    EXPECT_EQ(round(), (list_of{"3:3"}));
+    int none = 0;
+    EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay arms nothing
+    EXPECT_EQ(lew_dispatch_once(wrapper, &none, nullptr), LC_OK);
+    EXPECT_EQ(none, 1);
+    EXPECT_EQ(fdic_event_update_timer(list, id, 6), LC_OK);
+    EXPECT_EQ(round(), (list_of{"3:3"}));
+    // A delay beyond all time waits, and doesn't wrap.
+    EXPECT_EQ(fdic_event_update_timer(list, id, INT64_MAX), LC_OK);
+    int32_t soon = 0;
+    ASSERT_EQ(fdic_event_add_timer(list, 1, this, called, word(9), &soon), LC_OK);
+    EXPECT_EQ(round(), (list_of{"3:9"}));
+    EXPECT_EQ(fdic_event_delete_timer(list, id), LC_OK);
+}
+
+// A change by another thread waits for the loop; until then, and for good when the loop has ended, nothing of
+// the bridge moves and no handler runs.
+TEST_F(FdicBridge, ChangesOfAnotherThreadAreTheLoopsToMake) {
+    const int32_t id = add(1, 0);
+    calls.clear();
+    ASSERT_EQ(write(ends[1], "x", 1), 1);
+    std::thread([&] { EXPECT_EQ(fdic_event_delete_fd(list, id), LC_OK); }).join();
+    EXPECT_TRUE(calls.empty());
+    EXPECT_EQ(round(), (list_of{"5:55"})); // and not 1:1
+    int32_t second = 0;
+    std::thread([&] {
+        second = add(1, 0);
+        EXPECT_EQ(fdic_event_update_fd(list, second, 1, 1), LC_OK);
+    }).join();
+    EXPECT_EQ(round(), (list_of{"4:44"}));
+    EXPECT_EQ(round(), (list_of{"1:1", "2:2"}));
+    std::thread([&] { EXPECT_EQ(fdic_event_update_fd(list, second, 0, 0), LC_OK); }).join();
+    calls.clear();
+    EXPECT_EQ(fdic_event_update_fd(list, second, 0, 1), LC_OK); // behind the other's change
+    EXPECT_EQ(round(), (list_of{"2:2"}));
+    std::thread([&] { EXPECT_EQ(fdic_event_delete_fd(list, second), LC_OK); }).join();
+    calls.clear(); // taken down with the change still waiting
+}
+
+TEST_F(FdicBridge, ManyInterests) {
+    std::vector<int32_t> ids;
+    for (int i = 0; i < 500; i++)
+        ids.push_back(add(0, 1));
+    EXPECT_EQ(round().size(), 500u);
+    for (size_t i = 0; i < ids.size(); i += 2)
+        EXPECT_EQ(fdic_event_delete_fd(list, ids[i]), LC_OK);
+    EXPECT_EQ(round().size(), 250u);
+}
+
+} // namespace
