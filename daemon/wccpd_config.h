@@ -1,6 +1,12 @@
 // The configuration tree: read once at start, then followed change by change. Main thread only.
 #pragma once
 
+#include "engine/wccp_mgr.h"
+#include "mgmt/bnode.h"
 #include "runtime/common.h"
 
 lc_status wccpd_config_query();
+// The new values of a change event, in the order that decides what a change does to running groups.
+lc_status wccpd_config_apply(bn_binding_array *new_values);
+// Fills the field of a node kind from a binding.
+lc_status wccpd_config_update_group_binding(wccp_grp_config *config, const bn_binding *binding, int kind);

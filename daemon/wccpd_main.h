@@ -1,4 +1,5 @@
-// The process itself: start-up order, signals, orderly exit, and the cells that tell how far the daemon has come.
+// The process itself: start-up order, signals, orderly exit, and the cells that tell how far the daemon has
+// come.
 #pragma once
 
 #include <atomic>
@@ -8,6 +9,7 @@
 #include "runtime/loop_host.h"
 
 extern const char *const wccpd_program_name;
+constexpr uint32_t WCCPD_LOG_COMPONENT = 0x1060000;
 extern lew *wccpd_lwc; // the main thread's event loop; null before lew_init and after lew_deinit
 
 // How far the daemon has come. The daemon stores 0 and 1 only; the whole table is what monitoring prints.

@@ -28,11 +28,6 @@
 #include "runtime/guards.h"
 #include "runtime/logging.h"
 
-#ifdef WCCP_SANITIZED
-static constexpr size_t STACK_BYTES = 512 * 1024;
-#else
-static constexpr size_t STACK_BYTES = 128 * 1024;
-#endif
 static constexpr uint32_t CPU_LIMIT = 128;
 
 static pthread_mutex_t thread_list_mutex = PTHREAD_MUTEX_INITIALIZER;
@@ -96,7 +91,7 @@ static int build_attributes(pthread_attr_t *attributes, const cthread *context) 
     const int policy = static_cast<int>(context->policy);
     sched_param parameters = {};
     parameters.sched_priority = policy == SCHED_OTHER ? 0 : context->priority;
-    if (pthread_attr_setstacksize(attributes, STACK_BYTES) == 0 &&
+    if (pthread_attr_setstacksize(attributes, CTHREAD_STACK_BYTES) == 0 &&
         pthread_attr_setinheritsched(attributes, PTHREAD_EXPLICIT_SCHED) == 0 &&
         pthread_attr_setschedpolicy(attributes, policy) == 0 &&
         pthread_attr_setschedparam(attributes, &parameters) == 0)

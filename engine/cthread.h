@@ -2,9 +2,17 @@
 // wait of the engine is cut short; their stacks are small, since all memory of the process is locked.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 
 #include <pthread.h>
+
+// A packet, the log buffers and what stands between them; the sanitizers need more.
+#ifdef WCCP_SANITIZED
+constexpr size_t CTHREAD_STACK_BYTES = 512 * 1024;
+#else
+constexpr size_t CTHREAD_STACK_BYTES = 128 * 1024;
+#endif
 
 struct cthread {
     cthread *next, **prev_link;

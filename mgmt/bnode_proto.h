@@ -63,8 +63,8 @@ struct bn_response_node {
     bn_binding *binding; // owned
     uint32_t msg_type;
 };
-struct bn_request_per_node_array;
-struct bn_response_per_node_array;
+TYPED_ARRAY_DECLARE(bn_request_per_node_array, bn_request_node *)
+TYPED_ARRAY_DECLARE(bn_response_per_node_array, bn_response_node *)
 
 struct bn_request_msg {
     uint16_t service_id;
@@ -184,11 +184,3 @@ BN_CALLBACK_SETTERS(action_response, bn_response_callback)
 BN_CALLBACK_SETTERS(event_request, bn_request_callback)
 BN_CALLBACK_SETTERS(event_response, bn_response_callback)
 #undef BN_CALLBACK_SETTERS
-
-// Owners for a scope.
-inline void bn_free_request(bn_request_msg *msg) {
-    (void)bn_request_msg_free(&msg);
-}
-inline void bn_free_response(bn_response_msg *msg) {
-    (void)bn_response_msg_free(&msg);
-}

@@ -1,0 +1,5 @@
+#include "daemon/wccpd_main.h"
+
+int main() {
+    return wccpd_main();
+}

@@ -1,0 +1,208 @@
+// The spine of the daemon: the fixed order in which everything is brought up, the loop that the main thread
+// sits in for the rest of its life, and the order in which everything is taken down.
+//
+// Everything here runs on the main thread. It is the only thread that takes signals: all others block them,
+// so that no sleep or wait of theirs is cut short. Signals and management messages are callbacks on the loop,
+// and a callback may wait for mgmtd by running the loop again from inside itself (wccpd_mgmt.cpp);
+// wccpd_initiate_exit can therefore run nested in such a wait, and every wait ends by itself once
+// wccpd_exiting is set.
+//
+// The order of the start is not free: the engine asks mgmtd for the system mode and the primary interface, so
+// the session stands before it; the alarm session stands before the engine can raise anything. A start that
+// fails half way does not end the process: it sits in its loop, never ready, until a signal comes.
+//
+// The order of the exit: alarms are cleared while their session stands, then that session and its thread go,
+// the signal registrations, the working session, and the mailbox is reset. Groups still run then, with the
+// tick idle; wccpd_deinit stops them once the loop has returned. Nothing is ever reconnected or repaired:
+// whoever started the daemon starts it again.
+//
+// The closed library's thread lives until exit() is through and may call into the engine to the last: the
+// engine's records are plain objects without destructors, and the callbacks return at once when wccpd_exiting
+// is set.
+#include "daemon/wccpd_main.h"
+
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include <malloc.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "daemon/wccpd_config.h"
+#include "daemon/wccpd_mgmt.h"
+#include "engine/wccp_alarm_client.h"
+#include "engine/wccp_host.h"
+#include "engine/wccp_mgr.h"
+#include "engine/wccpd_common.h"
+#include "platform/file_utils.h"
+#include "platform/limits.h"
+#include "runtime/logging.h"
+
+const char *const wccpd_program_name = "wccpd";
+lew *wccpd_lwc;
+std::atomic<int32_t> m_daemon_status{WCCPD_INITIALIZING};
+std::atomic<int32_t> wccpd_exiting;
+uint32_t g_qv_encap_entry_count;
+uint32_t g_qv_encap_wccp_first, g_qv_encap_wccp_last;
+uint32_t g_qv_encap_clstr_first, g_qv_encap_clstr_last;
+
+constexpr const char *WCCPD_PID_FILE = "/var/run/wccpd.pid";
+
+const lc_enum_entry wccpd_status_table[] = {
+    {0, "Initializing"},
+    {1, "Ready"},
+    {50, "Failed-Partial"},
+    {51, "Failed-Initialization"},
+    {52, "Failed-DB Loading"},
+    {53, "Failed-Memory Initialization"},
+    {54, "Failed-Thread Initialization"},
+    {90, "Shutdown"},
+    {91, "DeInitialization"},
+    {0, nullptr},
+};
+
+// The signals that the daemon takes, in the order of their registration and removal.
+struct wccpd_signal {
+    int number;
+    bool ends_daemon;
+    lew_event *slot;
+};
+static wccpd_signal wccpd_signals[] = {
+    {SIGHUP, true, nullptr},  {SIGINT, true, nullptr},   {SIGPIPE, false, nullptr},
+    {SIGTERM, true, nullptr}, {SIGUSR1, false, nullptr}, {SIGUSR2, false, nullptr},
+};
+
+int32_t wccpd_shutdown_in_progress() {
+    return wccpd_exiting.load(std::memory_order_relaxed);
+}
+
+lc_status wccpd_handle_signal(int signal_number, short, void *, lew *) {
+    LC_LOG(LC_LOG_INFO, "Received %s", lc_signal_num_to_name(signal_number));
+    for (const wccpd_signal &known : wccpd_signals) {
+        if (known.number != signal_number)
+            continue;
+        if (known.ends_daemon)
+            CHECK_STATUS(wccpd_initiate_exit());
+        return LC_OK;
+    }
+    LC_LOG(LC_LOG_WARNING, "Got unexpected signal %s", lc_signal_num_to_name(signal_number));
+    return LC_OK;
+}
+
+uint32_t qv_encap_setup_entries() {
+    const uint32_t base = get_max_tunnel_number();
+    g_qv_encap_wccp_first = base + 10;
+    g_qv_encap_wccp_last = base + 41;
+    g_qv_encap_clstr_first = base + 51;
+    g_qv_encap_clstr_last = base + 82;
+    return base + 84;
+}
+
+lc_status wccpd_pid_init() {
+    char text[16];
+    const int length = snprintf(text, sizeof text, "%d\n", static_cast<int>(getpid()));
+    LOG_STATUS(lf_ensure_dir_of_file(WCCPD_PID_FILE, 0755));
+    errno = 0;
+    const lc_status status = lf_write_file(WCCPD_PID_FILE, 0644, text, 1, static_cast<uint32_t>(length));
+    if (status != LC_OK) {
+        const int failure = errno;
+        char action[64];
+        snprintf(action, sizeof action, "Writing %s", WCCPD_PID_FILE);
+        const char *words = failure ? strerror(failure) : "(unknown error)";
+        LC_LOG(LC_LOG_ERR, "%s: %s", action, words);
+    }
+    return status;
+}
+
+lc_status wccpd_serv_init() {
+    CHECK_CONDITION(wccpd_lwc != nullptr);
+    return wccp_init_mgr();
+}
+
+static lc_status wccpd_alarms_init() {
+    return qv_alm_mgmt_init(wccpd_program_name);
+}
+
+// What the start waits for mgmtd in. An exit that begins in one of them ends the start there: nothing may be
+// brought up behind the back of what has been taken down.
+static lc_status (*const wccpd_start_steps[])() = {
+    wccpd_mgmt_init,
+    wccpd_alarms_init,
+    wccpd_serv_init,
+    wccpd_config_query,
+};
+
+lc_status wccpd_init() {
+    umask(0);
+    const int32_t facility = lc_log_get_facility(nullptr, wccpd_program_name);
+    CHECK_STATUS(lc_log_init(wccpd_program_name, nullptr, 0, WCCPD_LOG_COMPONENT, LC_LOG_DEBUG, facility, 1));
+    LC_LOG(LC_LOG_NOTICE, "WCCP daemon launched");
+    CHECK_STATUS(lew_init(&wccpd_lwc));
+    CHECK_NULL(wccpd_lwc);
+    for (wccpd_signal &known : wccpd_signals)
+        CHECK_STATUS(
+            lew_event_reg_signal(wccpd_lwc, &known.slot, known.number, wccpd_handle_signal, nullptr));
+    for (lc_status (*step)() : wccpd_start_steps) {
+        CHECK_STATUS(step());
+        if (wccpd_shutdown_in_progress())
+            return LC_CANCELLED;
+    }
+    g_qv_encap_entry_count = qv_encap_setup_entries();
+    LC_LOG(LC_LOG_NOTICE, "%s: encap entries:%d wccp start %d/%d clstr start %d/%d", "wccpd_init",
+           static_cast<int>(g_qv_encap_entry_count), static_cast<int>(g_qv_encap_wccp_first),
+           static_cast<int>(g_qv_encap_wccp_last), static_cast<int>(g_qv_encap_clstr_first),
+           static_cast<int>(g_qv_encap_clstr_last));
+    m_daemon_status = WCCPD_READY;
+    CHECK_STATUS(wccpd_pid_init());
+    return LC_OK;
+}
+
+lc_status wccpd_main_loop() {
+    CHECK_STATUS(lew_dispatch(wccpd_lwc, nullptr, nullptr));
+    return LC_OK;
+}
+
+lc_status wccpd_initiate_exit() {
+    wccpd_exiting = 1;
+    wccp_alarms_clear_all();
+    LOG_STATUS(qv_initiate_exit());
+    for (wccpd_signal &known : wccpd_signals)
+        CHECK_STATUS(lew_event_delete(wccpd_lwc, &known.slot));
+    CHECK_STATUS(wccpd_mgmt_shutdown());
+    CHECK_STATUS(lew_escape_from_dispatch(wccpd_lwc));
+    if (wccp_cleanup_shmem() != 0) {
+        LC_LOG(LC_LOG_ERR, "WCCP: Cannot cleanup shared memory");
+        return 1;
+    }
+    return LC_OK;
+}
+
+lc_status wccpd_deinit() {
+    CHECK_STATUS(wccpd_mgmt_deinit());
+    CHECK_STATUS(qv_alm_mgmt_deinit());
+    (void)wccp_exit_mgr();
+    CHECK_STATUS(lew_deinit(&wccpd_lwc));
+    return LC_OK;
+}
+
+int wccpd_main() {
+    (void)mlockall(MCL_CURRENT | MCL_FUTURE);
+    // All mapped memory is locked, and each thread that allocates would map an arena of 64 MB of its own.
+    (void)mallopt(M_ARENA_MAX, 1);
+    const lc_status first = lc_init();
+    if (first != LC_OK) {
+        LOG_STATUS(first);
+        exit(first);
+    }
+    LOG_STATUS(wccpd_init());
+    LOG_STATUS(wccpd_main_loop());
+    const lc_status code = wccpd_deinit();
+    LOG_STATUS(code);
+    LC_LOG(LC_LOG_NOTICE, "WCCP daemon exiting with code %d", code);
+    (void)lc_log_close();
+    exit(code);
+}

@@ -1,0 +1,201 @@
+// The working session with mgmtd: how it is opened, which events are asked for, and what each message does.
+//
+// Everything here runs on the main thread inside the loop, and nests: a request of the daemon's own is waited
+// for by running the loop again (mgmt/client_session.h), so that events, queries and the loss of the session
+// are handled in the middle of it. Handlers run inside the session's recursive locks; the engine lock is
+// taken behind them, inside the engine. A failing handler never ends the session. The session is never
+// reconnected: its loss, or the word that tunneld has gone, begins the exit.
+#include "daemon/wccpd_mgmt.h"
+
+#include <cstring>
+
+#include "daemon/wccpd_config.h"
+#include "daemon/wccpd_main.h"
+#include "daemon/wccpd_monitor.h"
+#include "engine/wccp_host.h"
+#include "mgmt/client_session.h"
+#include "mgmt/log_levels.h"
+#include "mgmt/owners.h"
+#include "runtime/logging.h"
+
+gcl_session *wccpd_mgmt_session;
+mdc *wccpd_mcc;
+static int32_t wccpd_response_expected;
+static int32_t wccpd_expected_request_id;
+static bn_response_msg *wccpd_captured_response;
+
+// The bridge, interest list and instance that stand under the session are the daemon's wccpd_fdic_lew_handle,
+// wccpd_fdic_handle and wccpd_gcl_handle.
+static mgmt_client wccpd_client = {&wccpd_lwc,
+                                   &wccpd_mgmt_session,
+                                   &wccpd_mcc,
+                                   &wccpd_response_expected,
+                                   &wccpd_expected_request_id,
+                                   &wccpd_captured_response,
+                                   &wccpd_exiting,
+                                   "",
+                                   nullptr,
+                                   nullptr,
+                                   nullptr};
+static gcl *&wccpd_gcl_handle = wccpd_client.instance;
+
+static lc_status wccpd_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
+                                        bn_response_msg **out_response) {
+    return mgmt_client_request(&wccpd_client, request, out_response);
+}
+
+static lc_status wccpd_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
+    CHECK_STATUS(mgmt_client_response(&wccpd_client, response));
+    return LC_OK;
+}
+
+static lc_status wccpd_mgmt_handle_event_response(gcl_session *, bn_response_msg *, void *) {
+    return LC_OK;
+}
+
+static lc_status wccpd_mgmt_handle_query_request(gcl_session *session, bn_request_msg *request, void *) {
+    if (m_daemon_status != WCCPD_READY) {
+        LC_LOG(LC_LOG_INFO, "Discard event req because init not ready");
+        return LC_OK;
+    }
+    CHECK_STATUS(mdc_dispatch_mon_request(session, request, wccpd_mon_handle_get, nullptr,
+                                          wccpd_mon_handle_iterate, nullptr));
+    return LC_OK;
+}
+
+static lc_status wccpd_mgmt_handle_action_request(gcl_session *session, bn_request_msg *request, void *) {
+    uint16_t type = 0;
+    CHECK_STATUS(bn_request_get(request, &type, nullptr, 0, nullptr, nullptr, nullptr));
+    CHECK_CONDITION(type == bn_msg_action_request);
+    owned_tstring name;
+    CHECK_STATUS(bn_action_request_msg_get_action_name(request, &name.pointer));
+    LC_LOG(LC_LOG_INFO, "Received action %s", ts_str(name.pointer));
+    owned_response response;
+    CHECK_STATUS(bn_action_response_msg_create(
+        &response.pointer, static_cast<uint32_t>(bn_request_get_msg_id(request)), 0, nullptr));
+    CHECK_STATUS(bn_response_msg_send(session, response.pointer));
+    return LC_OK;
+}
+
+static lc_status wccpd_process_proc_fail(const char *event_name, const bn_binding_array *bindings) {
+    LC_LOG(LC_LOG_INFO, "Processing proc event: %s", event_name);
+    bn_binding *first = bn_binding_array_get_quick(bindings, 0);
+    if (!first)
+        return LC_OK;
+    owned_tstring process;
+    CHECK_STATUS(bn_binding_get_tstr(first, bn_attrib_value, bn_type_str, nullptr, &process.pointer));
+    if (!process.pointer || strcmp(ts_str(process.pointer), "tunneld") != 0)
+        return LC_OK;
+    LC_LOG(LC_LOG_INFO, "WCCP: Detected that tunneld has exited");
+    CHECK_STATUS(wccpd_initiate_exit());
+    return LC_OK;
+}
+
+static lc_status wccpd_config_changed(const char *, bn_binding_array *bindings) {
+    owned_bindings old_values, new_values;
+    CHECK_STATUS(mdc_event_config_change_notif_extract(bindings, &old_values.pointer, &new_values.pointer));
+    CHECK_STATUS(wccpd_config_apply(new_values.pointer));
+    return LC_OK;
+}
+
+static lc_status wccpd_proc_event(const char *event_name, bn_binding_array *bindings) {
+    CHECK_STATUS(wccpd_process_proc_fail(event_name, bindings));
+    return LC_OK;
+}
+
+static const struct {
+    const char *name;
+    lc_status (*handle)(const char *event_name, bn_binding_array *bindings);
+} wccpd_events[] = {
+    {"/mgmtd/notify/dbchange", wccpd_config_changed},
+    {"/pm/events/failure/crash", wccpd_proc_event},
+    {"/pm/events/failure/unexpected_exit", wccpd_proc_event},
+    {"/pm/events/proc/terminate", wccpd_proc_event},
+};
+
+static lc_status wccpd_mgmt_handle_event_request(gcl_session *, bn_request_msg *request, void *) {
+    uint16_t type = 0;
+    owned_bindings bindings;
+    CHECK_STATUS(bn_request_get(request, &type, nullptr, 0, &bindings.pointer, nullptr, nullptr));
+    CHECK_CONDITION(type == bn_msg_event);
+    owned_tstring stored;
+    CHECK_STATUS(bn_event_request_msg_get_event_name(request, &stored.pointer));
+    CHECK_NULL(stored.pointer);
+    const char *name = ts_str(stored.pointer);
+    LC_LOG(LC_LOG_INFO, "Received event: %s", name);
+    for (const auto &known : wccpd_events)
+        if (strcmp(known.name, name) == 0) {
+            CHECK_STATUS(known.handle(name, bindings.pointer));
+            return LC_OK;
+        }
+    if (qv_handle_time_zone_change(name) != LC_OK)
+        LC_LOG(LC_LOG_WARNING, "Received unexpected event %s", name);
+    return LC_OK;
+}
+
+static lc_status wccpd_mgmt_handle_session_close(int, uint32_t, void *, void *) {
+    if (wccpd_exiting)
+        return LC_OK;
+    wccpd_response_expected = 0;
+    LC_LOG(LC_LOG_ERR, "Lost connection to mgmtd; exiting");
+    CHECK_STATUS(wccpd_initiate_exit());
+    return LC_OK;
+}
+
+static lc_status wccpd_mgmt_register_interests() {
+    constexpr const char *ADD = "/mgmtd/events/actions/interest/add";
+    CHECK_STATUS(mdc_send_action_with_bindings_str_va(
+        wccpd_mcc, nullptr, nullptr, ADD, 5,                                                        //
+        "event_name", static_cast<uint32_t>(bn_type_name), "/mgmtd/notify/dbchange",                //
+        "match/1/pattern", static_cast<uint32_t>(bn_type_str), "/qv/wccpd/**",                      //
+        "match/2/pattern", static_cast<uint32_t>(bn_type_str), "/qv/tunneld/system/config/mode/**", //
+        "match/3/pattern", static_cast<uint32_t>(bn_type_str), "/logging/**",                       //
+        "match/4/pattern", static_cast<uint32_t>(bn_type_str), "/logging/syslog/facility/**"));
+    static const char *const process_events[] = {
+        "/pm/events/failure/crash",
+        "/pm/events/failure/unexpected_exit",
+        "/pm/events/proc/terminate",
+    };
+    for (const char *event : process_events)
+        CHECK_STATUS(mdc_send_action_with_bindings_str_va(wccpd_mcc, nullptr, nullptr, ADD, 1, "event_name",
+                                                          static_cast<uint32_t>(bn_type_name), event));
+    CHECK_STATUS(qv_register_time_zone_change(wccpd_mcc));
+    return LC_OK;
+}
+
+static lc_status wccpd_mgmt_open_session() {
+    lc_status status = mgmt_client_open(&wccpd_client, wccpd_program_name, wccpd_mgmt_msg_handler);
+    if (status == LC_OK)
+        status = wccpd_mgmt_register_interests();
+    if (status != LC_OK)
+        LC_LOG(LC_LOG_ERR, "Unable to connect to the management daemon");
+    return status;
+}
+
+lc_status wccpd_mgmt_init() {
+    CHECK_STATUS(mgmt_client_init(&wccpd_client, wccpd_mgmt_handle_session_close));
+    CHECK_STATUS(
+        bn_set_global_callback_query_response_msg(wccpd_gcl_handle, wccpd_mgmt_handle_response, nullptr));
+    CHECK_STATUS(
+        bn_set_global_callback_action_response_msg(wccpd_gcl_handle, wccpd_mgmt_handle_response, nullptr));
+    CHECK_STATUS(bn_set_global_callback_event_response_msg(wccpd_gcl_handle, wccpd_mgmt_handle_event_response,
+                                                           nullptr));
+    CHECK_STATUS(
+        bn_set_global_callback_query_request_msg(wccpd_gcl_handle, wccpd_mgmt_handle_query_request, nullptr));
+    CHECK_STATUS(
+        bn_set_global_callback_event_request_msg(wccpd_gcl_handle, wccpd_mgmt_handle_event_request, nullptr));
+    CHECK_STATUS(bn_set_global_callback_action_request_msg(wccpd_gcl_handle, wccpd_mgmt_handle_action_request,
+                                                           nullptr));
+    CHECK_STATUS(wccpd_mgmt_open_session());
+    return LC_OK;
+}
+
+lc_status wccpd_mgmt_shutdown() {
+    CHECK_STATUS(gcl_shutdown(wccpd_gcl_handle));
+    return LC_OK;
+}
+
+lc_status wccpd_mgmt_deinit() {
+    mgmt_client_deinit(&wccpd_client);
+    return LC_OK;
+}

@@ -1,0 +1,344 @@
+// Monitoring: mgmtd asks for a node by name and gets at most one binding, or for a node's children and gets
+// names.
+//
+// Nothing is cached. Each request goes to the engine's queries, which take the engine lock for their own
+// length, and the answer is rendered here: every node is a row that tells what it is asked of and how its
+// value is written. The text nodes carry the engine's dumps in buffers that live for the one request.
+//
+// Main thread only, and only once the daemon is ready. Router and appliance numbers are places in a list at
+// the moment of the request and may name somebody else at the next.
+#include "daemon/wccpd_monitor.h"
+
+#include <cinttypes>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "daemon/wccpd_main.h"
+#include "engine/wccp_config.h"
+#include "engine/wccp_debug_utils.h"
+#include "engine/wccp_utils.h"
+#include "mgmt/owners.h"
+#include "runtime/csys.h"
+#include "runtime/logging.h"
+
+#define STATE_ROOT "/qv/wccpd/wccp/srv_grp/state"
+#define SYSTEM_STATE "/qv/wccpd/system/state"
+
+// Parts of a name below the state root, counted from 0.
+enum : uint32_t { GROUP_PART = 5, NUMBER_PART = 7, ADDRESS_PART = 9 };
+
+// What a request is about, and what the engine said of it.
+struct mon_subject {
+    const char *name;
+    const tstr_array *parts;
+    uint8_t group;
+    wccp_grp_info group_info;
+    wccp_grp_router_info router;
+    wccp_grp_appliance_info appliance;
+    uint32_t load_percent;
+};
+
+struct mon_value {
+    char text[160];
+};
+struct mon_dump {
+    uint32_t size;
+    int (*print)(csys_display_buf *buffer, uint8_t group);
+    bool cut_text_counts; // what was written is the value even when it did not fit
+};
+struct mon_node {
+    const char *pattern;
+    uint32_t type;
+    void (*value)(const mon_subject *subject, mon_value *out);
+    const mon_dump *dump;
+};
+
+static const char *address_text(be32 address, mon_value *out) {
+    return get_addr_str(4, address, 0, out->text, 46);
+}
+static void put_number(mon_value *out, uint32_t number) {
+    snprintf(out->text, sizeof out->text, "%d", static_cast<int>(number));
+}
+static void put_seconds_as_ms(mon_value *out, uint32_t seconds) {
+    snprintf(out->text, sizeof out->text, "%" PRId64, static_cast<int64_t>(seconds) * 1000);
+}
+static void put_words(mon_value *out, const char *words) {
+    strlcpy(out->text, words, sizeof out->text);
+}
+
+#define VALUE(statement)                                                                                     \
+    [](const mon_subject *s, mon_value *out) {                                                               \
+        (void)s;                                                                                             \
+        statement;                                                                                           \
+    }
+
+static const mon_dump global_dump = {
+    WCCP_DUMP_GLOBAL_BYTES, [](csys_display_buf *b, uint8_t) { return wccp_print_global(b); }, false};
+static const mon_dump all_dump = {
+    WCCP_DUMP_ALL_BYTES, [](csys_display_buf *b, uint8_t) { return wccp_print_all_wccp_info(b); }, false};
+static const mon_dump group_dump = {
+    WCCP_DUMP_GROUP_BYTES, [](csys_display_buf *b, uint8_t g) { return wccp_print_service_grp(b, g); }, true};
+static const mon_dump assignment_dump = {
+    WCCP_DUMP_ASSIGNMENT_BYTES,
+    [](csys_display_buf *b, uint8_t g) { return wccp_print_service_grp_assignment_details(g, b); }, false};
+
+// First match wins.
+static const mon_node mon_nodes[] = {
+    {SYSTEM_STATE "/proto_ver", bn_type_str, VALUE(put_words(out, "2.0")), nullptr},
+    {STATE_ROOT "/*/oper", bn_type_str, VALUE(put_words(out, s->group_info.oper)), nullptr},
+    {STATE_ROOT "/*/uptime", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->group_info.uptime)),
+     nullptr},
+    {STATE_ROOT "/*/app_id", bn_type_str, VALUE(address_text(s->group_info.appliance_ipa, out)), nullptr},
+    {STATE_ROOT "/*/num_routers", bn_type_uint32, VALUE(put_number(out, s->group_info.num_routers)), nullptr},
+    {STATE_ROOT "/*/num_appliances", bn_type_uint32, VALUE(put_number(out, s->group_info.num_appliances)),
+     nullptr},
+    {STATE_ROOT "/*/router/*/state", bn_type_str, VALUE(put_words(out, s->router.state)), nullptr},
+    {STATE_ROOT "/*/router/*/fwd_method", bn_type_str, VALUE(put_words(out, s->router.fwd)), nullptr},
+    {STATE_ROOT "/*/router/*/assign_method", bn_type_str, VALUE(put_words(out, s->router.assign)), nullptr},
+    {STATE_ROOT "/*/router/*/ret_method", bn_type_str, VALUE(put_words(out, s->router.ret)), nullptr},
+    {STATE_ROOT "/*/router/*/id", bn_type_ipv4addr, VALUE(address_text(s->router.router_id, out)), nullptr},
+    {STATE_ROOT "/*/router/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->router.src_ipa, out)), nullptr},
+    {STATE_ROOT "/*/router/*/conn_time", bn_type_duration_ms,
+     VALUE(put_seconds_as_ms(out, s->router.conn_time)), nullptr},
+    {STATE_ROOT "/*/router/*/appliance/*/load_dist", bn_type_uint32,
+     VALUE(snprintf(out->text, sizeof out->text, "%u", s->load_percent)), nullptr},
+    {STATE_ROOT "/*/appliance/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->appliance.ipa, out)),
+     nullptr},
+    {STATE_ROOT "/*/appliance/*/weight", bn_type_uint32, VALUE(put_number(out, s->appliance.weight)),
+     nullptr},
+    {STATE_ROOT "/*/debug", bn_type_str, nullptr, &group_dump},
+    {STATE_ROOT "/*/assignment", bn_type_str, nullptr, &assignment_dump},
+    {SYSTEM_STATE "/debug_global", bn_type_str, nullptr, &global_dump},
+    {SYSTEM_STATE "/debug_all", bn_type_str, nullptr, &all_dump},
+    {SYSTEM_STATE "/is_alive", bn_type_str,
+     VALUE(put_words(out, lc_enum_to_string(wccpd_status_table, m_daemon_status))), nullptr},
+};
+
+// Nodes that exist so that what iterate finds can be listed; they answer with their own last part.
+static const char *const wildcard_nodes[] = {
+    STATE_ROOT "/*",
+    STATE_ROOT "/*/router/*",
+    STATE_ROOT "/*/router/*/appliance/*",
+};
+
+static bool matches(const mon_subject *subject, const char *pattern) {
+    return bn_binding_name_parts_pattern_match(subject->parts, 1, pattern) != 0;
+}
+
+static bool is_under(const char *name, const char *prefix) {
+    const size_t length = strlen(prefix);
+    return strncmp(name, prefix, length) == 0 && name[length] == '/';
+}
+
+static long number_part(const mon_subject *subject, uint32_t index) {
+    const char *text = tstr_array_get_str_quick(subject->parts, index);
+    return text ? strtol(text, nullptr, 10) : 0;
+}
+
+static lc_status append_text(const char *name, uint32_t type, const char *text, bn_binding_array *out) {
+    owned_binding binding;
+    CHECK_STATUS(bn_binding_new_str(&binding.pointer, name, bn_attrib_value, type, 0, text));
+    CHECK_STATUS(bn_binding_array_append_takeover(out, &binding.pointer));
+    return LC_OK;
+}
+
+static lc_status wccpd_mon_handle_get_wildcard(const mon_subject *subject, const char *last,
+                                               bn_binding_array *out) {
+    CHECK_STATUS(append_text(subject->name, bn_type_str, last, out));
+    return LC_OK;
+}
+
+// Asks the engine for what the name is about. `answered` stays false where there is nothing to say.
+static lc_status ask_engine(mon_subject *subject, bool *answered) {
+    char routers[64], appliances[64], router_appliances[96];
+    *answered = true;
+    if (!is_under(subject->name, STATE_ROOT))
+        return LC_OK;
+    subject->group = static_cast<uint8_t>(number_part(subject, GROUP_PART));
+    const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
+    const int group = static_cast<int>(group_text ? strtol(group_text, nullptr, 10) : 0);
+    snprintf(routers, sizeof routers, "%s/%d/router", STATE_ROOT, group);
+    snprintf(appliances, sizeof appliances, "%s/%d/appliance", STATE_ROOT, group);
+    if (!is_under(subject->name, routers)) {
+        const int status = wccp_get_grp_info(subject->group, &subject->group_info);
+        if (status != 0) {
+            LC_LOG(LC_LOG_ERR, "wccp_get_grp_info failed: %d", status);
+            *answered = false;
+            return LC_OK;
+        }
+    } else {
+        subject->router.router_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
+        CHECK_STATUS(wccp_get_grp_router_info(subject->group, &subject->router));
+        snprintf(router_appliances, sizeof router_appliances, "%s/%d/router/%d/appliance", STATE_ROOT, group,
+                 static_cast<int>(subject->router.router_num));
+        if (is_under(subject->name, router_appliances) &&
+            !tstr_array_get_str_quick(subject->parts, ADDRESS_PART)) {
+            LC_LOG(LC_LOG_ERR, "Appliance number (at 9th) not found in %s", subject->name);
+            *answered = false;
+            return LC_OK;
+        }
+    }
+    if (is_under(subject->name, appliances)) {
+        subject->appliance.appliance_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
+        const int status = wccp_get_grp_appliance_info(subject->group, &subject->appliance);
+        if (status != 0) {
+            LC_LOG(LC_LOG_ERR, "wccp_get_grp_appliance_info failed: status=%d", status);
+            *answered = false;
+        }
+    }
+    return LC_OK;
+}
+
+static lc_status ask_load(mon_subject *subject, bool *answered) {
+    uint32_t address = 0;
+    CHECK_STATUS(lc_str_to_ipv4addr(tstr_array_get_str_quick(subject->parts, ADDRESS_PART), &address));
+    wccp_router_appliance_info info = {};
+    info.group_id = subject->group;
+    info.router_num = subject->router.router_num;
+    info.ipa = to_be32(address);
+    const int status = wccp_get_router_appliance_info(&info);
+    if (status != 0) {
+        LC_LOG(LC_LOG_ERR, "wccp_get_router_appliance_info: failed: status=%d", status);
+        *answered = false;
+    }
+    subject->load_percent = info.load_percent;
+    return LC_OK;
+}
+
+static lc_status append_dump(const mon_subject *subject, const mon_node *node, bn_binding_array *out) {
+    const mon_dump *dump = node->dump;
+    owned<void, wccp_free> memory(wccp_malloc(dump->size));
+    if (!memory.pointer) {
+        LC_LOG(LC_LOG_ERR, "%s: malloc failed", __func__);
+        return LC_OK;
+    }
+    csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.pointer, dump->size);
+    CHECK_NULL(buffer);
+    if (dump->print(buffer, subject->group) != 0 && !dump->cut_text_counts)
+        return LC_OK;
+    CHECK_STATUS(append_text(subject->name, node->type, csys_display_buf_text(buffer), out));
+    return LC_OK;
+}
+
+lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_parts, void *,
+                               bn_binding_array *out) {
+    LC_LOG(LC_LOG_INFO, "MonGet %s", node_name);
+    if (!is_under(node_name, "/qv/wccpd")) {
+        LC_LOG(LC_LOG_INFO, "MonGet not for wccpd, bailing - %s", node_name);
+        return LC_OK;
+    }
+    mon_subject subject = {};
+    subject.name = node_name;
+    subject.parts = name_parts;
+    const uint32_t count = tstr_array_length_quick(name_parts);
+    const char *last = count ? tstr_array_get_str_quick(name_parts, count - 1) : nullptr;
+    CHECK_NULL(last);
+    LC_LOG(LC_LOG_INFO, "MonGet: last_name_part=%s", last);
+    for (const char *pattern : wildcard_nodes)
+        if (matches(&subject, pattern)) {
+            CHECK_STATUS(wccpd_mon_handle_get_wildcard(&subject, last, out));
+            return LC_OK;
+        }
+    bool answered = false;
+    CHECK_STATUS(ask_engine(&subject, &answered));
+    if (!answered)
+        return LC_OK;
+    for (const mon_node &node : mon_nodes) {
+        if (!matches(&subject, node.pattern))
+            continue;
+        if (node.dump) {
+            CHECK_STATUS(append_dump(&subject, &node, out));
+            return LC_OK;
+        }
+        if (strcmp(last, "load_dist") == 0)
+            CHECK_STATUS(ask_load(&subject, &answered));
+        if (!answered)
+            return LC_OK;
+        mon_value value = {};
+        node.value(&subject, &value);
+        CHECK_STATUS(append_text(node_name, node.type, value.text, out));
+        return LC_OK;
+    }
+    return LC_OK;
+}
+
+static lc_status append_name(tstr_array *out, const char *text) {
+    owned_text copy(safe_strdup(text));
+    CHECK_NULL(copy.pointer);
+    CHECK_STATUS(tstr_array_append_str_takeover(out, &copy.pointer));
+    return LC_OK;
+}
+static lc_status append_number(tstr_array *out, uint32_t number) {
+    char text[16];
+    snprintf(text, sizeof text, "%d", static_cast<int>(number));
+    CHECK_STATUS(append_name(out, text));
+    return LC_OK;
+}
+
+static lc_status iterate_router_appliances(const mon_subject *subject, tstr_array *out) {
+    wccp_router_appliance_list list = {};
+    list.group_id = static_cast<uint8_t>(number_part(subject, GROUP_PART));
+    list.router_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
+    const int status = wccp_get_router_appliance_list(&list);
+    if (status != 0) {
+        LC_LOG(LC_LOG_ERR, "wccp_get_router_appliance_list failed: status=%d", status);
+        return LC_OK;
+    }
+    for (uint32_t i = 0; i < list.count; i++)
+        CHECK_STATUS(append_name(out, addr_text(list.ipa[i]).s));
+    return LC_OK;
+}
+
+static lc_status iterate_routers(const mon_subject *subject, tstr_array *out) {
+    wccp_router_list list = {};
+    list.group_id = static_cast<uint8_t>(number_part(subject, GROUP_PART));
+    const int status = wccp_get_router_list(&list);
+    if (status != 0) {
+        LC_LOG(LC_LOG_ERR, "wccp_get_router_list: failed: status=%d", status);
+        return LC_OK;
+    }
+    for (uint32_t i = 0; i < list.count; i++)
+        CHECK_STATUS(append_number(out, list.router_nums[i]));
+    return LC_OK;
+}
+
+static lc_status iterate_groups(const mon_subject *, tstr_array *out) {
+    static_assert(sizeof(wccp_grp_list) == 260);
+    owned<void, wccp_free> memory(wccp_malloc(sizeof(wccp_grp_list)));
+    wccp_grp_list *list = static_cast<wccp_grp_list *>(memory.pointer);
+    if (!list) {
+        LC_LOG(LC_LOG_ERR, "%s: malloc failed", __func__);
+        return LC_OK;
+    }
+    const int status = wccp_get_grp_list(list);
+    if (status != 0) {
+        LC_LOG(LC_LOG_ERR, "wccp_get_grp_list failed: status=%d", status);
+        return LC_OK;
+    }
+    for (uint32_t i = 0; i < list->count; i++)
+        CHECK_STATUS(append_number(out, list->ids[i]));
+    return LC_OK;
+}
+
+lc_status wccpd_mon_handle_iterate(const char *node_name, const tstr_array *name_parts, void *,
+                                   tstr_array *out) {
+    static const struct {
+        const char *pattern;
+        lc_status (*children)(const mon_subject *subject, tstr_array *out);
+    } parents[] = {
+        {STATE_ROOT "/*/router/*/appliance", iterate_router_appliances},
+        {STATE_ROOT "/*/router", iterate_routers},
+        {STATE_ROOT, iterate_groups},
+    };
+    LC_LOG(LC_LOG_DEBUG, "iterate %s", node_name);
+    mon_subject subject = {};
+    subject.name = node_name;
+    subject.parts = name_parts;
+    for (const auto &parent : parents)
+        if (matches(&subject, parent.pattern)) {
+            CHECK_STATUS(parent.children(&subject, out));
+            return LC_OK;
+        }
+    return LC_OK;
+}

@@ -1,0 +1,168 @@
+// The client session of the alarms, on a thread of its own.
+//
+// Alarms and state events are sent from the engine's timer and receive threads, which never touch the
+// daemon's working session; so they have a session of their own. The alarm thread does nothing but run that
+// session's loop: it reads acknowledgements, writes what a full socket left over and notices a lost
+// connection. Senders go straight to the session, under the engine lock and then the locks of this client's
+// own GCL instance; a change of interest that they need is posted to the loop and carried out on the alarm
+// thread, so that nobody holds those locks while waiting for the loop's. No callback here ever takes the
+// engine lock.
+//
+// qv_initiate_exit comes from the main thread at exit, and from the alarm thread itself when the session is
+// lost; the thread does not join itself. A lost alarm session ends this client only: the daemon ends through
+// its working session, which goes with the same peer.
+#include "engine/wccp_alarm_client.h"
+
+#include <cerrno>
+#include <csignal>
+#include <cstring>
+
+#include <pthread.h>
+#include <semaphore.h>
+
+#include "engine/cthread.h"
+#include "mgmt/client_session.h"
+#include "runtime/logging.h"
+
+gcl_session *qv_alm_mgmt_session;
+static lew *qv_alm_lwc;
+static mdc *qv_alm_mcc;
+static std::atomic<int32_t> qv_exiting;
+static int32_t qv_response_expected;
+static int32_t qv_expected_request_id;
+static bn_response_msg *qv_captured_response;
+static mgmt_client qv_alm_client = {&qv_alm_lwc,
+                                    &qv_alm_mgmt_session,
+                                    &qv_alm_mcc,
+                                    &qv_response_expected,
+                                    &qv_expected_request_id,
+                                    &qv_captured_response,
+                                    &qv_exiting,
+                                    "qv_alm_mgmt_handle_response :",
+                                    nullptr,
+                                    nullptr,
+                                    nullptr};
+
+static pthread_t alarm_thread;
+static bool alarm_thread_runs; // the thread handle is set
+static sem_t started;
+static bool started_exists;
+
+static lc_status qv_alm_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
+    CHECK_STATUS(mgmt_client_response(&qv_alm_client, response));
+    return LC_OK;
+}
+
+static lc_status qv_alm_mgmt_handle_event_response(gcl_session *, bn_response_msg *, void *) {
+    return LC_OK;
+}
+
+static lc_status qv_alm_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
+                                         bn_response_msg **out_response) {
+    return mgmt_client_request(&qv_alm_client, request, out_response);
+}
+
+static lc_status qv_alm_mgmt_handle_session_close(int, uint32_t, void *, void *) {
+    if (qv_exiting)
+        return LC_OK;
+    qv_response_expected = 0;
+    LC_LOG(LC_LOG_ERR, "Lost connection to mgmtd; exiting");
+    CHECK_STATUS(qv_initiate_exit());
+    return LC_OK;
+}
+
+static lc_status qv_alm_mgmt_open_session(const char *client_name) {
+    const lc_status status = mgmt_client_open(&qv_alm_client, client_name, qv_alm_mgmt_msg_handler);
+    if (status != LC_OK)
+        LC_LOG(LC_LOG_ERR, "Unable to connect to the management daemon");
+    return status;
+}
+
+static lc_status start_session(const char *client_name) {
+    CHECK_STATUS(lew_init(&qv_alm_lwc));
+    CHECK_STATUS(mgmt_client_init(&qv_alm_client, qv_alm_mgmt_handle_session_close));
+    gcl *instance = qv_alm_client.instance;
+    CHECK_STATUS(bn_set_global_callback_query_response_msg(instance, qv_alm_mgmt_handle_response, nullptr));
+    CHECK_STATUS(bn_set_global_callback_action_response_msg(instance, qv_alm_mgmt_handle_response, nullptr));
+    CHECK_STATUS(
+        bn_set_global_callback_event_response_msg(instance, qv_alm_mgmt_handle_event_response, nullptr));
+    CHECK_STATUS(qv_alm_mgmt_open_session(client_name));
+    return LC_OK;
+}
+
+static void *qv_alm_thread(void *client_name) {
+    const lc_status status = start_session(static_cast<const char *>(client_name));
+    if (started_exists)
+        sem_post(&started);
+    if (status != LC_OK) {
+        LC_LOG(LC_LOG_ERR, "qv_alm_thread: failed to initialize alarm session");
+        return nullptr;
+    }
+    LOG_STATUS(lew_dispatch(qv_alm_lwc, nullptr, nullptr));
+    LC_LOG(LC_LOG_INFO, "qv_alm_thread: out of main loop, exiting...");
+    return nullptr;
+}
+
+// Signals are the main thread's, and locked memory is dear.
+static int create_thread(const char *client_name) {
+    pthread_attr_t attributes;
+    pthread_attr_init(&attributes);
+    pthread_attr_setstacksize(&attributes, CTHREAD_STACK_BYTES);
+    sigset_t all, previous;
+    sigfillset(&all);
+    pthread_sigmask(SIG_SETMASK, &all, &previous);
+    const int result =
+        pthread_create(&alarm_thread, &attributes, qv_alm_thread, const_cast<char *>(client_name));
+    pthread_sigmask(SIG_SETMASK, &previous, nullptr);
+    pthread_attr_destroy(&attributes);
+    return result;
+}
+
+lc_status qv_alm_mgmt_init(const char *client_name) {
+    started_exists = sem_init(&started, 0, 0) == 0;
+    if (!started_exists)
+        LC_LOG(LC_LOG_ERR, "Failed to init alm semaphore (%s), proceeding without it...", strerror(errno));
+    const int result = create_thread(client_name);
+    alarm_thread_runs = result == 0;
+    if (result != 0)
+        LC_LOG(LC_LOG_ERR, "Failed to create alarm thread : %s ", strerror(result));
+    if (started_exists) {
+        while (alarm_thread_runs && sem_wait(&started) != 0 && errno == EINTR) {
+        }
+        sem_destroy(&started);
+        started_exists = false;
+    }
+    return result;
+}
+
+lc_status qv_alm_mgmt_shutdown() {
+    LC_LOG(LC_LOG_INFO, "qv_alm_mgmt_shutdown: cancel alm thread");
+    if (qv_alm_lwc)
+        CHECK_STATUS(lew_escape_from_dispatch(qv_alm_lwc));
+    if (alarm_thread_runs && !pthread_equal(alarm_thread, pthread_self())) {
+        const int result = pthread_join(alarm_thread, nullptr);
+        if (result != 0 && result != ESRCH) {
+            LC_LOG(LC_LOG_ERR, "qv_alm_mgmt_shutdown: failed to join thread : %s ", strerror(result));
+            return result;
+        }
+        alarm_thread_runs = false;
+    }
+    LC_LOG(LC_LOG_INFO, "qv_alm_mgmt_shutdown: alm thread exited");
+    if (qv_alm_client.instance)
+        CHECK_STATUS(gcl_shutdown(qv_alm_client.instance));
+    return LC_OK;
+}
+
+lc_status qv_initiate_exit() {
+    qv_exiting = 1;
+    CHECK_STATUS(qv_alm_mgmt_shutdown());
+    if (qv_alm_lwc)
+        CHECK_STATUS(lew_escape_from_dispatch(qv_alm_lwc));
+    return LC_OK;
+}
+
+lc_status qv_alm_mgmt_deinit() {
+    mgmt_client_deinit(&qv_alm_client);
+    LOG_STATUS(lew_deinit(&qv_alm_lwc));
+    return LC_OK;
+}

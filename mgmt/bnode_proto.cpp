@@ -1,0 +1,530 @@
+// Messages in memory: requests and responses are made, filled, read and freed here; nothing of them is kept
+// anywhere. The bytes stand in bnode_wire.cpp, the way over a session in bnode_session.cpp.
+#include "mgmt/bnode_proto.h"
+
+#include <cstdlib>
+#include <cstring>
+
+#include "mgmt/bnode_proto_arrays.h"
+#include "runtime/logging.h"
+
+constexpr uint32_t FIRST_NODE_ID = 1000;
+
+const lc_enum_entry bn_msg_type_table[] = {
+    {bn_msg_none, "none"},
+    {bn_msg_query_request, "query_request"},
+    {bn_msg_query_response, "query_response"},
+    {bn_msg_set_request, "set_request"},
+    {bn_msg_set_response, "set_response"},
+    {bn_msg_action_request, "action_request"},
+    {bn_msg_action_response, "action_response"},
+    {bn_msg_event, "event"},
+    {bn_msg_event_ack, "event_ack"},
+    {0, nullptr},
+};
+const lc_enum_entry bn_query_subop_table[] = {
+    {bn_query_none, "none"},
+    {bn_query_get, "get"},
+    {bn_query_iterate, "iterate"},
+    {bn_query_registration_info, "registration_info"},
+    {0, nullptr},
+};
+const lc_enum_entry bn_set_subop_table[] = {
+    {bn_set_none, "invalid_NONE"},
+    {bn_set_create, "create"},
+    {bn_set_delete, "delete"},
+    {bn_set_reset, "reset"},
+    {bn_set_modify, "modify"},
+    {bn_set_reparent, "reparent"},
+    {0, nullptr},
+};
+
+uint16_t bn_request_msg_response_msg_type(uint16_t request_type) {
+    switch (request_type) {
+    case bn_msg_query_request:
+    case bn_msg_set_request:
+    case bn_msg_action_request:
+    case bn_msg_event:
+        return static_cast<uint16_t>(request_type + 1);
+    default:
+        LC_LOG(LC_LOG_WARNING, "Request message had unrecognized message type: %d", request_type);
+        return 0;
+    }
+}
+
+// --- Nodes
+// ----------------------------------------------------------------------------------------------------------
+
+void bn_request_node_free(bn_request_node *node) {
+    if (!node)
+        return;
+    (void)bn_binding_free(&node->binding);
+    ts_free(&node->source);
+    ts_free(&node->target);
+    free(node);
+}
+void bn_response_node_free(bn_response_node *node) {
+    if (!node)
+        return;
+    (void)bn_binding_free(&node->binding);
+    free(node);
+}
+
+void bn_request_per_node_free_for_array(void *node) {
+    bn_request_node_free(static_cast<bn_request_node *>(node));
+}
+void bn_response_per_node_free_for_array(void *node) {
+    bn_response_node_free(static_cast<bn_response_node *>(node));
+}
+
+lc_status bn_request_per_node_dup_for_array(const void *element, void **out_copy) {
+    CHECK_NULL(out_copy);
+    *out_copy = nullptr;
+    const bn_request_node *node = static_cast<const bn_request_node *>(element);
+    owned_request_node copy(static_cast<bn_request_node *>(calloc(1, sizeof *node)));
+    CHECK_NULL(copy.pointer);
+    copy.pointer->node_id = node->node_id;
+    copy.pointer->msg_type = node->msg_type;
+    copy.pointer->subop = node->subop;
+    copy.pointer->flags = node->flags;
+    if (node->binding)
+        CHECK_STATUS(bn_binding_dup(node->binding, &copy.pointer->binding));
+    if (node->source)
+        CHECK_STATUS(ts_dup(node->source, &copy.pointer->source));
+    if (node->target)
+        CHECK_STATUS(ts_dup(node->target, &copy.pointer->target));
+    *out_copy = copy.take();
+    return LC_OK;
+}
+lc_status bn_response_per_node_dup_for_array(const void *element, void **out_copy) {
+    CHECK_NULL(out_copy);
+    *out_copy = nullptr;
+    const bn_response_node *node = static_cast<const bn_response_node *>(element);
+    owned_response_node copy(static_cast<bn_response_node *>(calloc(1, sizeof *node)));
+    CHECK_NULL(copy.pointer);
+    copy.pointer->node_id = node->node_id;
+    copy.pointer->msg_type = node->msg_type;
+    if (node->binding)
+        CHECK_STATUS(bn_binding_dup(node->binding, &copy.pointer->binding));
+    *out_copy = copy.take();
+    return LC_OK;
+}
+
+static void fill_request_nodes(array_options *options) {
+    options->duplicate = bn_request_per_node_dup_for_array;
+    options->free = bn_request_per_node_free_for_array;
+}
+static void fill_response_nodes(array_options *options) {
+    options->duplicate = bn_response_per_node_dup_for_array;
+    options->free = bn_response_per_node_free_for_array;
+}
+TYPED_ARRAY_DEFINE(bn_request_per_node_array, bn_request_node *, fill_request_nodes)
+TYPED_ARRAY_DEFINE(bn_response_per_node_array, bn_response_node *, fill_response_nodes)
+
+// --- Requests
+// -------------------------------------------------------------------------------------------------------
+
+lc_status bn_request_msg_free(bn_request_msg **inout) {
+    if (!inout || !*inout)
+        return LC_OK;
+    ts_free(&(*inout)->audit_user);
+    ts_free(&(*inout)->text);
+    (void)bn_request_per_node_array_free(&(*inout)->nodes);
+    free(*inout);
+    *inout = nullptr;
+    return LC_OK;
+}
+
+lc_status bn_request_msg_create(bn_request_msg **out, uint16_t type) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    owned_request msg(static_cast<bn_request_msg *>(calloc(1, sizeof(bn_request_msg))));
+    CHECK_NULL(msg.pointer);
+    msg.pointer->msg_type = type;
+    msg.pointer->next_node_id = FIRST_NODE_ID;
+    CHECK_STATUS(bn_request_per_node_array_new(&msg.pointer->nodes));
+    *out = msg.take();
+    return LC_OK;
+}
+
+static lc_status create_with_text(bn_request_msg **out, uint16_t type, const char *text) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    owned_request msg;
+    CHECK_STATUS(bn_request_msg_create(&msg.pointer, type));
+    if (text)
+        CHECK_STATUS(ts_new_str(&msg.pointer->text, text));
+    *out = msg.take();
+    return LC_OK;
+}
+
+lc_status bn_query_request_msg_create(bn_request_msg **out, uint32_t flags, const char *database) {
+    CHECK_STATUS(create_with_text(out, bn_msg_query_request, database));
+    (*out)->flags = flags;
+    return LC_OK;
+}
+lc_status bn_set_request_msg_create(bn_request_msg **out, uint32_t commit_flags) {
+    CHECK_STATUS(create_with_text(out, bn_msg_set_request, nullptr));
+    (*out)->flags = commit_flags;
+    return LC_OK;
+}
+lc_status bn_action_request_msg_create(bn_request_msg **out, const char *action_name) {
+    CHECK_NULL(action_name);
+    CHECK_STATUS(create_with_text(out, bn_msg_action_request, action_name));
+    return LC_OK;
+}
+lc_status bn_event_request_msg_create(bn_request_msg **out, const char *event_name) {
+    CHECK_NULL(event_name);
+    CHECK_STATUS(create_with_text(out, bn_msg_event, event_name));
+    return LC_OK;
+}
+
+static lc_status append_node(bn_request_msg *msg, uint16_t type, uint32_t subop, uint32_t flags,
+                             bn_binding **inout_binding, uint32_t *out_node_id) {
+    if (out_node_id)
+        *out_node_id = 0;
+    CHECK_NULL(msg);
+    CHECK_NULL(inout_binding);
+    CHECK_NULL(*inout_binding);
+    CHECK_CONDITION(msg->msg_type == type);
+    owned_request_node node(static_cast<bn_request_node *>(calloc(1, sizeof(bn_request_node))));
+    CHECK_NULL(node.pointer);
+    node.pointer->node_id = msg->next_node_id;
+    node.pointer->msg_type = type;
+    node.pointer->subop = subop;
+    node.pointer->flags = flags;
+    node.pointer->binding = *inout_binding;
+    *inout_binding = nullptr;
+    CHECK_STATUS(bn_request_per_node_array_append_takeover(msg->nodes, &node.pointer));
+    if (out_node_id)
+        *out_node_id = msg->next_node_id;
+    msg->next_node_id++;
+    return LC_OK;
+}
+
+lc_status bn_query_request_msg_append_str(bn_request_msg *msg, uint32_t subop, uint32_t flags,
+                                          const char *node_name, uint32_t *out_node_id) {
+    CHECK_STATUS(
+        bn_query_request_msg_append_with_attribs(msg, subop, flags, node_name, nullptr, out_node_id));
+    return LC_OK;
+}
+
+// A value-less attribute stands for each one that is asked for.
+static lc_status ask_for_attributes(bn_binding *binding, const bn_attrib_array *attributes) {
+    const uint32_t count = bn_attrib_array_length_quick(attributes);
+    for (uint32_t id = 0; id < count; id++)
+        if (bn_attrib_array_get_quick(attributes, id))
+            CHECK_STATUS(bn_binding_set_str(binding, id, bn_type_none, 0, ""));
+    return LC_OK;
+}
+
+lc_status bn_query_request_msg_append_with_attribs(bn_request_msg *msg, uint32_t subop, uint32_t flags,
+                                                   const char *node_name, const bn_attrib_array *attributes,
+                                                   uint32_t *out_node_id) {
+    CHECK_NULL(msg);
+    CHECK_NULL(node_name);
+    CHECK_CONDITION(msg->msg_type == bn_msg_query_request);
+    owned_binding binding;
+    if (attributes && subop == bn_query_registration_info) {
+        CHECK_STATUS(bn_binding_new_components(&binding.pointer, node_name, attributes));
+    } else {
+        CHECK_STATUS(bn_binding_new_named(&binding.pointer, node_name));
+        if (attributes)
+            CHECK_STATUS(ask_for_attributes(binding.pointer, attributes));
+    }
+    CHECK_STATUS(append_node(msg, bn_msg_query_request, subop, flags, &binding.pointer, out_node_id));
+    return LC_OK;
+}
+
+lc_status bn_set_request_msg_append_binding_takeover(bn_request_msg *msg, uint32_t subop, uint32_t flags,
+                                                     bn_binding **inout_binding, uint32_t *out_node_id) {
+    CHECK_STATUS(append_node(msg, bn_msg_set_request, subop, flags, inout_binding, out_node_id));
+    return LC_OK;
+}
+
+lc_status bn_query_request_msg_set_option_cond_db_revision_id(bn_request_msg *msg, uint32_t revision) {
+    CHECK_NULL(msg);
+    CHECK_CONDITION(msg->msg_type == bn_msg_query_request);
+    msg->number = revision;
+    return LC_OK;
+}
+lc_status bn_query_request_msg_get_option_cond_db_revision_id(const bn_request_msg *msg,
+                                                              uint32_t *out_revision) {
+    CHECK_NULL(out_revision);
+    *out_revision = 0;
+    CHECK_NULL(msg);
+    CHECK_CONDITION(msg->msg_type == bn_msg_query_request);
+    *out_revision = msg->number;
+    return LC_OK;
+}
+
+lc_status bn_action_request_msg_append_binding_takeover(bn_request_msg *msg, uint32_t,
+                                                        bn_binding **inout_binding, uint32_t *out_node_id) {
+    CHECK_STATUS(append_node(msg, bn_msg_action_request, 0, 0, inout_binding, out_node_id));
+    return LC_OK;
+}
+lc_status bn_event_request_msg_append_binding_takeover(bn_request_msg *msg, uint32_t,
+                                                       bn_binding **inout_binding, uint32_t *out_node_id) {
+    CHECK_STATUS(append_node(msg, bn_msg_event, 0, 0, inout_binding, out_node_id));
+    return LC_OK;
+}
+lc_status bn_action_request_msg_append_new_binding(bn_request_msg *msg, uint32_t node_id, const char *name,
+                                                   uint32_t type, const char *text, uint32_t *out_node_id) {
+    owned_binding binding;
+    CHECK_STATUS(bn_binding_new_str_autoinval(&binding.pointer, name, bn_attrib_value, type, 0, text));
+    CHECK_STATUS(bn_action_request_msg_append_binding_takeover(msg, node_id, &binding.pointer, out_node_id));
+    return LC_OK;
+}
+lc_status bn_event_request_msg_append_new_binding(bn_request_msg *msg, uint32_t node_id, const char *name,
+                                                  uint32_t type, const char *text, uint32_t *out_node_id) {
+    owned_binding binding;
+    CHECK_STATUS(bn_binding_new_str_autoinval(&binding.pointer, name, bn_attrib_value, type, 0, text));
+    CHECK_STATUS(bn_event_request_msg_append_binding_takeover(msg, node_id, &binding.pointer, out_node_id));
+    return LC_OK;
+}
+
+static lc_status get_text(const bn_request_msg *msg, uint16_t type, tstring **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(msg);
+    CHECK_CONDITION(msg->msg_type == type);
+    if (msg->text)
+        CHECK_STATUS(ts_dup(msg->text, out));
+    return LC_OK;
+}
+lc_status bn_action_request_msg_get_action_name(const bn_request_msg *msg, tstring **out) {
+    CHECK_STATUS(get_text(msg, bn_msg_action_request, out));
+    return LC_OK;
+}
+lc_status bn_event_request_msg_get_event_name(const bn_request_msg *msg, tstring **out) {
+    CHECK_STATUS(get_text(msg, bn_msg_event, out));
+    return LC_OK;
+}
+lc_status bn_request_set_transaction_id(bn_request_msg *msg, uint32_t transaction_id) {
+    CHECK_NULL(msg);
+    msg->transaction_id = transaction_id;
+    return LC_OK;
+}
+
+// --- Responses
+// ------------------------------------------------------------------------------------------------------
+
+lc_status bn_response_msg_free(bn_response_msg **inout) {
+    if (!inout || !*inout)
+        return LC_OK;
+    ts_free(&(*inout)->return_message);
+    (void)bn_response_per_node_array_free(&(*inout)->nodes);
+    free(*inout);
+    *inout = nullptr;
+    return LC_OK;
+}
+
+lc_status bn_response_msg_create(bn_response_msg **out, uint16_t type, uint32_t response_to,
+                                 uint32_t return_code, const char *message) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    owned_response msg(static_cast<bn_response_msg *>(calloc(1, sizeof(bn_response_msg))));
+    CHECK_NULL(msg.pointer);
+    msg.pointer->msg_type = type;
+    msg.pointer->response_to = response_to;
+    msg.pointer->return_code = return_code;
+    if (message)
+        CHECK_STATUS(ts_new_str(&msg.pointer->return_message, message));
+    CHECK_STATUS(bn_response_per_node_array_new(&msg.pointer->nodes));
+    *out = msg.take();
+    return LC_OK;
+}
+lc_status bn_query_response_msg_create(bn_response_msg **out, uint32_t response_to, uint32_t return_code,
+                                       const char *message) {
+    CHECK_STATUS(bn_response_msg_create(out, bn_msg_query_response, response_to, return_code, message));
+    return LC_OK;
+}
+lc_status bn_action_response_msg_create(bn_response_msg **out, uint32_t response_to, uint32_t return_code,
+                                        const char *message) {
+    CHECK_STATUS(bn_response_msg_create(out, bn_msg_action_response, response_to, return_code, message));
+    return LC_OK;
+}
+
+lc_status bn_response_msg_append_binding_takeover(bn_response_msg *msg, bn_binding **inout_binding,
+                                                  uint32_t node_id) {
+    CHECK_NULL(msg);
+    CHECK_NULL(inout_binding);
+    CHECK_NULL(*inout_binding);
+    owned_response_node node(static_cast<bn_response_node *>(calloc(1, sizeof(bn_response_node))));
+    CHECK_NULL(node.pointer);
+    node.pointer->node_id = node_id;
+    node.pointer->msg_type = msg->msg_type;
+    node.pointer->binding = *inout_binding;
+    *inout_binding = nullptr;
+    CHECK_STATUS(bn_response_per_node_array_append_takeover(msg->nodes, &node.pointer));
+    return LC_OK;
+}
+lc_status bn_query_response_msg_append_binding_takeover(bn_response_msg *msg, bn_binding **inout_binding,
+                                                        uint32_t node_id) {
+    CHECK_NULL(msg);
+    CHECK_CONDITION(msg->msg_type == bn_msg_query_response);
+    CHECK_STATUS(bn_response_msg_append_binding_takeover(msg, inout_binding, node_id));
+    return LC_OK;
+}
+
+lc_status bn_response_msg_dup(const bn_response_msg *msg, bn_response_msg **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(msg);
+    owned_response copy(static_cast<bn_response_msg *>(malloc(sizeof *msg)));
+    CHECK_NULL(copy.pointer);
+    *copy.pointer = *msg;
+    copy.pointer->return_message = nullptr;
+    copy.pointer->nodes = nullptr;
+    if (msg->return_message)
+        CHECK_STATUS(ts_dup(msg->return_message, &copy.pointer->return_message));
+    CHECK_STATUS(bn_response_per_node_array_duplicate(msg->nodes, &copy.pointer->nodes));
+    *out = copy.take();
+    return LC_OK;
+}
+
+// --- Reading
+// --------------------------------------------------------------------------------------------------------
+
+int32_t bn_request_get_msg_id(const bn_request_msg *msg) {
+    return msg ? static_cast<int32_t>(msg->msg_id) : -1;
+}
+
+// Parts that the reader asked for are made now; the others go.
+static lc_status settle_parts(bn_binding *binding, int keep_parts) {
+    if (!keep_parts)
+        return bn_binding_drop_name_parts(binding);
+    if (!binding->parts)
+        CHECK_STATUS(bn_binding_name_to_parts(ts_str(binding->name), &binding->parts, nullptr));
+    return LC_OK;
+}
+
+lc_status bn_request_get(const bn_request_msg *msg, uint16_t *out_type, const void **out_body, int keep_parts,
+                         bn_binding_array **out_bindings, uint32_array **out_node_ids,
+                         bn_node_info **out_node_info) {
+    if (out_type)
+        *out_type = 0;
+    if (out_body)
+        *out_body = nullptr;
+    if (out_bindings)
+        *out_bindings = nullptr;
+    if (out_node_ids)
+        *out_node_ids = nullptr;
+    if (out_node_info)
+        *out_node_info = nullptr;
+    CHECK_NULL(msg);
+    if (msg->msg_type % 2 == 0 || msg->msg_type > bn_msg_event)
+        FAIL_WITH(LC_UNEXPECTED_CASE);
+    const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
+    owned_bindings bindings;
+    owned_uint32_array ids;
+    owned_node_info info;
+    CHECK_STATUS(bn_binding_array_new(&bindings.pointer));
+    CHECK_STATUS(uint32_array_new(&ids.pointer));
+    info.pointer = static_cast<bn_node_info *>(calloc(count ? count : 1, sizeof(bn_node_info)));
+    CHECK_NULL(info.pointer);
+    for (uint32_t i = 0; i < count; i++) {
+        const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
+        owned_binding copy;
+        CHECK_STATUS(bn_binding_dup(node->binding, &copy.pointer));
+        CHECK_STATUS(settle_parts(copy.pointer, keep_parts));
+        CHECK_STATUS(bn_binding_array_append_takeover(bindings.pointer, &copy.pointer));
+        CHECK_STATUS(uint32_array_append(ids.pointer, node->node_id));
+        info.pointer[i] = {node->subop, node->flags};
+    }
+    if (out_type)
+        *out_type = msg->msg_type;
+    if (out_body)
+        *out_body = &msg->flags;
+    if (out_bindings)
+        *out_bindings = bindings.take();
+    if (out_node_ids)
+        *out_node_ids = ids.take();
+    if (out_node_info)
+        *out_node_info = info.take();
+    return LC_OK;
+}
+
+lc_status bn_response_get_msg_ids(const bn_response_msg *msg, uint32_t *out_response_to,
+                                  uint32_t *out_msg_id) {
+    CHECK_NULL(msg);
+    if (out_response_to)
+        *out_response_to = msg->response_to;
+    if (out_msg_id)
+        *out_msg_id = msg->msg_id;
+    return LC_OK;
+}
+
+// Moves a node's binding out of the message, or copies it.
+static lc_status read_node(bn_response_node *node, bool take, bn_binding **out) {
+    if (take) {
+        *out = node->binding;
+        node->binding = nullptr;
+        return LC_OK;
+    }
+    CHECK_STATUS(bn_binding_dup(node->binding, out));
+    return LC_OK;
+}
+
+static lc_status read_response(const bn_response_msg *msg, bool take, uint32_t *out_code,
+                               tstring **out_message, int keep_parts, bn_binding_array **out_bindings,
+                               uint32_array **out_node_ids) {
+    if (out_code)
+        *out_code = 0;
+    if (out_message)
+        *out_message = nullptr;
+    if (out_bindings)
+        *out_bindings = nullptr;
+    if (out_node_ids)
+        *out_node_ids = nullptr;
+    CHECK_NULL(msg);
+    owned_bindings bindings;
+    owned_uint32_array ids;
+    owned_tstring message;
+    CHECK_STATUS(bn_binding_array_new(&bindings.pointer));
+    CHECK_STATUS(uint32_array_new(&ids.pointer));
+    if (out_message && msg->return_message)
+        CHECK_STATUS(ts_dup(msg->return_message, &message.pointer));
+    const uint32_t count =
+        out_bindings || out_node_ids ? bn_response_per_node_array_length_quick(msg->nodes) : 0;
+    for (uint32_t i = 0; i < count; i++) {
+        bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
+        owned_binding binding;
+        if (!node->binding)
+            continue;
+        CHECK_STATUS(read_node(node, take, &binding.pointer));
+        CHECK_STATUS(settle_parts(binding.pointer, keep_parts));
+        CHECK_STATUS(bn_binding_array_append_takeover(bindings.pointer, &binding.pointer));
+        CHECK_STATUS(uint32_array_append(ids.pointer, node->node_id));
+    }
+    if (out_code)
+        *out_code = msg->return_code;
+    if (out_message)
+        *out_message = message.take();
+    if (out_bindings)
+        *out_bindings = bindings.take();
+    if (out_node_ids)
+        *out_node_ids = ids.take();
+    return LC_OK;
+}
+
+lc_status bn_response_get_takeover(bn_response_msg *msg, uint32_t *out_code, tstring **out_message,
+                                   int keep_parts, bn_binding_array **out_bindings,
+                                   uint32_array **out_node_ids) {
+    CHECK_STATUS(read_response(msg, true, out_code, out_message, keep_parts, out_bindings, out_node_ids));
+    return LC_OK;
+}
+lc_status bn_response_get(const bn_response_msg *msg, uint32_t *out_code, tstring **out_message,
+                          int keep_parts, bn_binding_array **out_bindings, uint32_array **out_node_ids) {
+    CHECK_STATUS(read_response(msg, false, out_code, out_message, keep_parts, out_bindings, out_node_ids));
+    return LC_OK;
+}
+
+lc_status bn_query_response_msg_get_db_revision_id(const bn_response_msg *msg, uint32_t *out_revision) {
+    CHECK_NULL(out_revision);
+    *out_revision = 0;
+    CHECK_NULL(msg);
+    CHECK_CONDITION(msg->msg_type == bn_msg_query_response);
+    *out_revision = msg->db_revision_id;
+    return LC_OK;
+}

@@ -1,0 +1,285 @@
+// Messages over a session: protocol 2 of the instance, its state for the instance and for each session,
+// sending, and the way of a received frame to the callback of its type.
+//
+// Everything here runs with the instance's and the session's locks held, in that order, both recursive: a
+// callback may send on its own session, and may wait for an answer by running the loop again, so that further
+// messages of the same session are received inside it. A message lives on this side of the callback and is
+// freed behind it; nothing of the session is touched after the callback but the message.
+#include <cstdlib>
+#include <cstring>
+
+#include "mgmt/bnode_proto.h"
+#include "mgmt/gcl_wire.h"
+#include "mgmt/owners.h"
+#include "runtime/logging.h"
+
+struct bn_callback {
+    bn_request_callback request; // of odd types
+    bn_response_callback response;
+    void *data;
+};
+constexpr uint16_t MSG_TYPES = bn_msg_event_ack + 1;
+
+// One for the instance.
+struct bn_instance_state {
+    uint32_t next_msg_id;
+    uint32_t transactions;
+    tstring *audit_user;
+    bn_callback callbacks[MSG_TYPES];
+};
+// One for each session.
+struct bn_session_state {
+    uint16_t service; // the session's bnode service, 0 until it is known
+    bn_callback callbacks[MSG_TYPES];
+};
+
+static bn_instance_state *instance_state(gcl *instance) {
+    gcl_body_protocol *protocol = gcl_get_body_protocol(instance, BN_PROTO);
+    return protocol ? static_cast<bn_instance_state *>(protocol->state) : nullptr;
+}
+static bn_session_state *session_state(gcl_session *session) {
+    return static_cast<bn_session_state *>(gcl_session_get_protocol_state(session, BN_PROTO));
+}
+
+// --- Callbacks
+// ------------------------------------------------------------------------------------------------------
+
+static lc_status set_global(gcl *instance, uint16_t type, bn_callback callback) {
+    CHECK_NULL(instance);
+    bn_instance_state *state = instance_state(instance);
+    CHECK_NULL(state);
+    state->callbacks[type] = callback;
+    return LC_OK;
+}
+static lc_status set_session(gcl_session *session, uint16_t type, bn_callback callback) {
+    CHECK_NULL(session);
+    const gcl_session_guard guard(session);
+    bn_session_state *state = session_state(session);
+    CHECK_NULL(state);
+    state->callbacks[type] = callback;
+    return LC_OK;
+}
+
+#define BN_REQUEST_SETTERS(kind, type)                                                                       \
+    lc_status bn_set_global_callback_##kind##_msg(gcl *instance, bn_request_callback callback, void *data) { \
+        return set_global(instance, type, {callback, nullptr, data});                                        \
+    }                                                                                                        \
+    lc_status bn_set_session_callback_##kind##_msg(gcl_session *session, bn_request_callback callback,       \
+                                                   void *data) {                                             \
+        return set_session(session, type, {callback, nullptr, data});                                        \
+    }
+#define BN_RESPONSE_SETTERS(kind, type)                                                                      \
+    lc_status bn_set_global_callback_##kind##_msg(gcl *instance, bn_response_callback callback,              \
+                                                  void *data) {                                              \
+        return set_global(instance, type, {nullptr, callback, data});                                        \
+    }                                                                                                        \
+    lc_status bn_set_session_callback_##kind##_msg(gcl_session *session, bn_response_callback callback,      \
+                                                   void *data) {                                             \
+        return set_session(session, type, {nullptr, callback, data});                                        \
+    }
+BN_REQUEST_SETTERS(query_request, bn_msg_query_request)
+BN_RESPONSE_SETTERS(query_response, bn_msg_query_response)
+BN_REQUEST_SETTERS(set_request, bn_msg_set_request)
+BN_RESPONSE_SETTERS(set_response, bn_msg_set_response)
+BN_REQUEST_SETTERS(action_request, bn_msg_action_request)
+BN_RESPONSE_SETTERS(action_response, bn_msg_action_response)
+BN_REQUEST_SETTERS(event_request, bn_msg_event)
+BN_RESPONSE_SETTERS(event_response, bn_msg_event_ack)
+
+// --- Sending
+// --------------------------------------------------------------------------------------------------------
+
+// The service that the session speaks: its bnode service, or else the one that the opening brought.
+static uint16_t service_of(gcl_session *session) {
+    bn_session_state *state = session_state(session);
+    if (!state)
+        return 0;
+    if (state->service == 0)
+        state->service = static_cast<uint16_t>(gcl_session_get_current_service(session));
+    return state->service;
+}
+
+// Message and transaction ids, as both kinds of message get them.
+template <typename Message>
+static lc_status number_message(gcl_session *session, Message *msg) {
+    bn_instance_state *state = instance_state(gcl_session_get_instance(session));
+    CHECK_NULL(state);
+    msg->msg_id = state->next_msg_id++;
+    if (msg->service_id == 0)
+        msg->service_id = service_of(session);
+    if (msg->transaction_id == 0) {
+        msg->transaction_id = state->next_msg_id;
+        state->transactions++;
+    }
+    return LC_OK;
+}
+
+static bool is_connected(gcl_session *session) {
+    int32_t state = GCL_SESSION_NONE;
+    return gcl_session_get_state(session, &state, nullptr) == LC_OK && state == GCL_SESSION_CONNECTED;
+}
+
+lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg) {
+    CHECK_NULL(session);
+    CHECK_NULL(msg);
+    const gcl_session_guard guard(session);
+    CHECK_STATUS(number_message(session, msg));
+    const bn_instance_state *state = instance_state(gcl_session_get_instance(session));
+    const bool audited = msg->msg_type == bn_msg_set_request || msg->msg_type == bn_msg_action_request;
+    if (audited && state->audit_user && !msg->audit_user)
+        CHECK_STATUS(ts_dup(state->audit_user, &msg->audit_user));
+    owned_tbuffer buffer;
+    CHECK_STATUS(bn_request_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &buffer.pointer));
+    bn_request_msg_dump(session, msg, LC_LOG_DEBUG, "SEND REQ");
+    if (!is_connected(session)) {
+        LC_LOG(LC_LOG_INFO, "Dropping request to non-connected session %d", gcl_session_get_id(session));
+        return LC_OK;
+    }
+    CHECK_STATUS(gcl_session_send_frame_components_tb(session, BN_PROTO, msg->msg_type, BN_FRAME_HEADER_BYTES,
+                                                      &buffer.pointer));
+    return LC_OK;
+}
+
+lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg) {
+    CHECK_NULL(session);
+    CHECK_NULL(msg);
+    const gcl_session_guard guard(session);
+    CHECK_STATUS(number_message(session, msg));
+    owned_tbuffer buffer;
+    CHECK_STATUS(bn_response_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &buffer.pointer));
+    bn_response_msg_dump(session, msg, LC_LOG_DEBUG, "SEND RESP");
+    if (!is_connected(session)) {
+        LC_LOG(LC_LOG_INFO, "Dropping response to non-connected session %d", gcl_session_get_id(session));
+        return LC_OK;
+    }
+    CHECK_STATUS(gcl_session_send_frame_components_tb(session, BN_PROTO, msg->msg_type, BN_FRAME_HEADER_BYTES,
+                                                      &buffer.pointer));
+    return LC_OK;
+}
+
+// --- Receiving
+// ------------------------------------------------------------------------------------------------------
+
+static const char *const kind_words[] = {"query", "set", "action", "event"};
+static const char *kind_word(uint16_t type) {
+    return kind_words[(type - 1) / 2];
+}
+
+static lc_status receive_request(gcl_session *session, uint16_t mtype, tbuffer **inout_frame) {
+    owned_request msg;
+    CHECK_STATUS(bn_request_msg_deserialize(*inout_frame, BN_FRAME_HEADER_BYTES, &msg.pointer));
+    bn_request_msg_dump(session, msg.pointer, -1, "RECV REQ");
+    (void)tb_free(inout_frame);
+    const int32_t id = gcl_session_get_id(session);
+    if (mtype < bn_msg_query_request || mtype > bn_msg_event_ack) {
+        LC_LOG(LC_LOG_ERR, "session %d: proto bnode: invalid body message type %d", id, mtype);
+        return LC_OK;
+    }
+    const bn_session_state *state = session_state(session);
+    CHECK_NULL(state);
+    const bn_callback callback = state->callbacks[mtype];
+    if (!callback.request) {
+        LC_LOG(LC_LOG_WARNING, "session %d: proto bnode: no %s request callback", id, kind_word(mtype));
+        return LC_OK;
+    }
+    (void)callback.request(session, msg.pointer, callback.data);
+    return LC_OK;
+}
+
+static lc_status receive_response(gcl_session *session, uint16_t mtype, tbuffer **inout_frame) {
+    constexpr int32_t HEADER_BYTES = 20;
+    const int32_t id = gcl_session_get_id(session);
+    CHECK_CONDITION(tb_length(*inout_frame) >= static_cast<int32_t>(BN_FRAME_HEADER_BYTES) + HEADER_BYTES);
+    be16 wire_service = {};
+    memcpy(wire_service.bytes, tb_buf(*inout_frame) + BN_FRAME_HEADER_BYTES, sizeof wire_service);
+    const uint16_t service = to_host(wire_service);
+    if (!gcl_session_service_is_open(session, service)) {
+        LC_LOG(LC_LOG_ERR, "session %d: service %d not open: %d", id, service,
+               gcl_session_get_current_service(session));
+        return LC_OK;
+    }
+    owned_response msg;
+    CHECK_STATUS(bn_response_msg_deserialize(*inout_frame, BN_FRAME_HEADER_BYTES, &msg.pointer));
+    bn_response_msg_dump(session, msg.pointer, -1, "RECV RESP");
+    (void)tb_free(inout_frame);
+    const bn_session_state *state = session_state(session);
+    CHECK_NULL(state);
+    const bn_callback callback = state->callbacks[mtype];
+    if (!callback.response) {
+        const char *text = msg.pointer->return_message ? ts_str(msg.pointer->return_message) : "";
+        LC_LOG(LC_LOG_WARNING, "session %d: proto bnode: no %s response callback: code = %d msg = %s", id,
+               kind_word(mtype), static_cast<int>(msg.pointer->return_code), text);
+        return LC_OK;
+    }
+    (void)callback.response(session, msg.pointer, callback.data);
+    return LC_OK;
+}
+
+static lc_status receive_frame(gcl_session *session, gcl_body_protocol *protocol, tbuffer **inout_frame,
+                               void *) {
+    CHECK_NULL(inout_frame);
+    owned_tbuffer frame(*inout_frame);
+    *inout_frame = nullptr;
+    LC_LOG(LC_LOG_DEBUG, "session %d: proto bnode: in receive CATCHALL", gcl_session_get_id(session));
+    CHECK_CONDITION(tb_length(frame.pointer) >= static_cast<int32_t>(BN_FRAME_HEADER_BYTES));
+    CHECK_NULL(session_state(session));
+    gcl_frame_header header;
+    memcpy(&header, tb_buf(frame.pointer), sizeof header);
+    CHECK_CONDITION(header.proto == protocol->protocol);
+    const bool response =
+        header.mtype % 2 == 0 && header.mtype >= bn_msg_query_response && header.mtype <= bn_msg_event_ack;
+    CHECK_STATUS(response ? receive_response(session, header.mtype, &frame.pointer)
+                          : receive_request(session, header.mtype, &frame.pointer));
+    return LC_OK;
+}
+
+// --- The protocol
+// ---------------------------------------------------------------------------------------------------
+
+static lc_status session_new(gcl_session *session, gcl_body_protocol *protocol) {
+    const bn_instance_state *shared = static_cast<const bn_instance_state *>(protocol->state);
+    CHECK_NULL(shared);
+    owned<void, bn_free_memory> state(calloc(1, sizeof(bn_session_state)));
+    CHECK_NULL(state.pointer);
+    memcpy(static_cast<bn_session_state *>(state.pointer)->callbacks, shared->callbacks,
+           sizeof shared->callbacks);
+    CHECK_STATUS(gcl_session_set_protocol_state(session, BN_PROTO, state.pointer));
+    (void)state.take();
+    return LC_OK;
+}
+
+static lc_status session_free(gcl_session *session, gcl_body_protocol *) {
+    free(session_state(session));
+    return gcl_session_set_protocol_state(session, BN_PROTO, nullptr);
+}
+
+lc_status gcl_bn_init(gcl *instance) {
+    CHECK_NULL(instance);
+    owned<void, bn_free_memory> state(calloc(1, sizeof(bn_instance_state)));
+    CHECK_NULL(state.pointer);
+    auto *shared = static_cast<bn_instance_state *>(state.pointer);
+    shared->next_msg_id = 1;
+    shared->transactions = 1;
+    gcl_body_protocol protocol = {};
+    protocol.protocol = BN_PROTO;
+    strlcpy(protocol.name, "bnode", sizeof protocol.name);
+    protocol.enabled = 1;
+    protocol.session_new = session_new;
+    protocol.session_free = session_free;
+    protocol.handlers[0] = {BN_PROTO, 0, receive_frame, nullptr};
+    protocol.state = shared;
+    CHECK_STATUS(gcl_register_body_protocol(instance, &protocol));
+    (void)state.take();
+    return LC_OK;
+}
+
+lc_status bn_deinit(gcl *instance) {
+    gcl_body_protocol *protocol = gcl_get_body_protocol(instance, BN_PROTO);
+    if (!protocol || !protocol->state)
+        return LC_OK;
+    auto *shared = static_cast<bn_instance_state *>(protocol->state);
+    ts_release(shared->audit_user);
+    free(shared);
+    protocol->state = nullptr;
+    return LC_OK;
+}
