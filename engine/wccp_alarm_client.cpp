@@ -44,7 +44,7 @@ static mgmt_client qv_alm_client = {&qv_alm_lwc,
                                     nullptr};
 
 static pthread_t alarm_thread;
-static bool alarm_thread_runs; // the thread handle is set
+static std::atomic<bool> alarm_thread_runs; // the thread handle is set
 static sem_t started;
 static bool started_exists;
 
@@ -161,7 +161,10 @@ lc_status qv_initiate_exit() {
     return LC_OK;
 }
 
+// The engine's threads still run; a sender among them finds the session whole or gone.
 lc_status qv_alm_mgmt_deinit() {
+    const cancel_off_guard uncancelled;
+    const mutex_guard guard(&qv_alm_session_mutex);
     mgmt_client_deinit(&qv_alm_client);
     LOG_STATUS(lew_deinit(&qv_alm_lwc));
     return LC_OK;

@@ -15,8 +15,12 @@
 
 #include "engine/wccp_router_utils.h"
 #include "engine/wccp_utils.h"
+#include "mgmt/owners.h"
+#include "platform/qvcommon_transport.h"
+#include "runtime/guards.h"
 
 gcl_session *qv_alm_mgmt_session;
+pthread_mutex_t qv_alm_session_mutex = PTHREAD_MUTEX_INITIALIZER;
 
 static constexpr uint32_t CHECK_DELAY = 60; // seconds
 
@@ -71,9 +75,29 @@ const alarm_kind *find_kind(uint16_t bit) {
 char alarm_param_3[64];
 char alarm_comment[64];
 
-// One alarm event on the alarm session. There is no client session to send on yet, so none goes out.
-lc_status send_alarm_event([[maybe_unused]] const char *event, [[maybe_unused]] const char *type) {
-    return LC_NOT_IMPLEMENTED;
+// One binding of an event.
+struct event_field {
+    const char *name;
+    uint32_t type;
+    const char *text;
+};
+
+// An event with its fields, on the alarm session; nothing waits for an answer. The engine's threads may
+// outlive the session at exit, so it is looked at under the lock that its end takes as well, and cancellation
+// is off meanwhile.
+template <size_t Count>
+lc_status send_event(const char *event, const event_field (&fields)[Count]) {
+    const cancel_off_guard uncancelled;
+    const mutex_guard guard(&qv_alm_session_mutex);
+    if (!qv_alm_mgmt_session)
+        return LC_NULL;
+    owned_request msg;
+    CHECK_QUIET(bn_event_request_msg_create(&msg.pointer, event));
+    for (const event_field &field : fields)
+        CHECK_QUIET(bn_event_request_msg_append_new_binding(msg.pointer, 0, field.name, field.type,
+                                                            field.text, nullptr));
+    CHECK_QUIET(bn_request_msg_send(qv_alm_mgmt_session, msg.pointer));
+    return LC_OK;
 }
 
 void tell_alarm(wccp_service_group *group, const alarm_kind *kind, const char *event, const char *text) {
@@ -83,7 +107,14 @@ void tell_alarm(wccp_service_group *group, const alarm_kind *kind, const char *e
     QV_LOG(LC_LOG_INFO, "%s", alarm_comment);
     char type[16];
     snprintf(type, sizeof type, "%u", kind->type);
-    LOG_STATUS(send_alarm_event(event, type));
+    const event_field fields[] = {
+        {"alarm_type", bn_type_str, type},       {"param_1", bn_type_str, "0"},
+        {"param_2", bn_type_str, "0"},           {"param_3", bn_type_str, alarm_param_3},
+        {"comment", bn_type_str, alarm_comment},
+    };
+    const lc_status status = send_event(event, fields);
+    if (status != LC_OK && status != LC_CANCELLED)
+        QV_LOG(LC_LOG_ERR, "Error code %d returned", status);
 }
 
 void wccp_alarm_raise_alarm(wccp_service_group *group, uint16_t bit) {
@@ -124,6 +155,22 @@ void wccp_alarms_clear_all() {
     for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
         if (group->raised_alarms != 0)
             wccp_alarms_clear_all_raised_alarms(group);
+}
+
+// A change of role, as the closed library hands it on: it goes the way of the alarms.
+int qv_state_event_transport(uint32_t one, const char *group_id, uint32_t role, const uint8_t *code,
+                             gcl_session *) {
+    char kind_text[12], role_text[12], code_text[12];
+    snprintf(kind_text, sizeof kind_text, "%u", one);
+    snprintf(role_text, sizeof role_text, "%u", role);
+    snprintf(code_text, sizeof code_text, "%u", code ? *code : 0);
+    const event_field fields[] = {
+        {"kind", bn_type_uint32, kind_text},
+        {"group", bn_type_str, group_id},
+        {"role", bn_type_uint32, role_text},
+        {"code", bn_type_uint32, code_text},
+    };
+    return send_event("/qv/state/events/role_change", fields) == LC_OK ? 0 : 1;
 }
 
 // The checks.

@@ -6,6 +6,9 @@
 
 struct gcl_session;
 extern gcl_session *qv_alm_mgmt_session; // null before it exists and after qv_alm_mgmt_deinit
+// Guards the session against its end while somebody sends: behind the engine lock, ahead of the session's own
+// locks.
+extern pthread_mutex_t qv_alm_session_mutex;
 
 // Lock held.
 void wccp_alarm_schedule_verify_router_connectivity_timer(wccp_service_group *group, int restart);
