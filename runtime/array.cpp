@@ -79,13 +79,13 @@ lc_status array_new(array **out, const array_options *options) {
     CHECK_NULL(list);
     (void)array_options_set(list, options ? options : &defaults);
     list->elements = static_cast<void **>(calloc(list->initial_size, sizeof(void *)));
-    if (!list->elements)
+    if (!list->elements) {
         free(list);
-    else
-        *out = list;
-    CHECK_NULL(*out);
+        FAIL_WITH(LC_NULL);
+    }
     list->capacity = list->initial_size;
     list->sorted = 1;
+    *out = list;
     return LC_OK;
 }
 
