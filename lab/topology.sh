@@ -144,6 +144,7 @@ lab_appliance() { # NAME ADDRESS...
         kill -0 $outer 2>/dev/null || { cat "$LAB/$node.out" >&2; lab_die "appliance $node did not start"; }
         sleep 0.02
     done
+    cp "$LAB_TOP"/packaging/*.conf "/proc/${LAB_INIT[$node]}/root/etc/opt/rvl/" || lab_die "no platform files for $node"
     lab_plug "$node" "${LAB_INIT[$node]}" "$@"
 }
 
