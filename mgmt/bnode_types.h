@@ -83,7 +83,7 @@ inline bool bn_attrib_id_valid(uint32_t id) {
     return id >= 1 && id <= BN_ATTRIB_LAST && id != bn_attrib_none;
 }
 
-extern const lc_enum_entry bn_type_table[];
+extern const lc_enum_entry *const bn_type_table;
 extern const lc_enum_entry bn_attribute_id_table[];
 
 // Predicates over a type word. With the invalid or the absent flag a type counts as having no value.
@@ -154,16 +154,16 @@ struct bn_attrib_copy_func {
     lc_status (*read)(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
                       uint32_t *out_used);
 };
-extern const bn_attrib_copy_func bn_attrib_copy_funcs[BN_TYPE_LAST + 1];
+extern const bn_attrib_copy_func *const bn_attrib_copy_funcs; // rows 0 to BN_TYPE_LAST
 // Through the table, with its checks: a type outside 1 to 134 is LC_ASSERTION, one with no wire form LC_NULL.
 lc_status bn_attrib_append_wire(const bn_attrib *attrib, tbuffer *buffer);
 // Reads the type ahead, then the attribute. Its id is one that an array may take as a place.
 lc_status bn_attrib_read_wire(const tbuffer *buffer, uint32_t offset, bn_attrib **out, uint32_t *out_used);
 
-// One row for each typed accessor: name, type number's name, value, what a setter is given, that as a value,
+// One row for each typed accessor: name, type number's name, value, what a setter is given, where it lies,
 // what a getter is given, how it gets it.
 #define BN_PLAIN_VALUE(X, name, number, type)                                                                \
-    X(name, number, type, (type value), value, (type * out_value), bn_give_plain(out_value, stored))
+    X(name, number, type, (type value), bn_at(value), (type * out_value), bn_give_plain(out_value, stored))
 #define BN_VALUE_TYPES(X)                                                                                    \
     BN_PLAIN_VALUE(X, uint8, bn_type_uint8, uint8_t)                                                         \
     BN_PLAIN_VALUE(X, int8, bn_type_int8, int8_t)                                                            \
@@ -181,10 +181,11 @@ lc_status bn_attrib_read_wire(const tbuffer *buffer, uint32_t offset, bn_attrib 
     BN_PLAIN_VALUE(X, ipprefix, bn_type_ipprefix, lc_ipprefix)                                               \
     BN_PLAIN_VALUE(X, ipv4addr, bn_type_ipv4addr, uint32_t)                                                  \
     BN_PLAIN_VALUE(X, ipv4prefix, bn_type_ipv4prefix, uint64_t)                                              \
-    X(macaddr802, bn_type_macaddr802, lc_macaddr802, (const lc_macaddr802 *value), *value,                   \
+    X(macaddr802, bn_type_macaddr802, lc_macaddr802, (const lc_macaddr802 *value), value,                    \
       (lc_macaddr802 * out_value), bn_give_plain(out_value, stored))                                         \
-    X(ipv6addr, bn_type_ipv6addr, lc_ipv6addr, (uint64_t first, uint64_t last), bn_join_halves(first, last), \
-      (uint64_t * out_first, uint64_t * out_last), bn_give_halves(out_first, out_last, stored))              \
+    X(ipv6addr, bn_type_ipv6addr, lc_ipv6addr, (uint64_t first, uint64_t last),                              \
+      bn_at(bn_join_halves(first, last)), (uint64_t * out_first, uint64_t * out_last),                       \
+      bn_give_halves(out_first, out_last, stored))                                                           \
     BN_PLAIN_VALUE(X, ipv6prefix, bn_type_ipv6prefix, lc_ipv6prefix)                                         \
     BN_PLAIN_VALUE(X, date, bn_type_date, lt_date)                                                           \
     BN_PLAIN_VALUE(X, time_sec, bn_type_time_sec, uint32_t)                                                  \

@@ -1,403 +1,281 @@
-// Messages on the wire. All integers are big-endian; a string is a 4-byte length and that many bytes. A
-// reader walks the received bytes and refuses to read past their end, so that no count that was announced is
-// believed further than the bytes that came with it.
-#include <cstdlib>
+// The bytes of an attribute on the wire: 16 bytes of kind, id, type and flags, then what the type's family
+// says. All numbers are big-endian; an address counts as one number of 128 bits, so its bytes stand reversed.
+//
+// What comes from a peer is bounded here: an id is a place in an array and has to be a valid one, a size has
+// to be the type's, a length has to lie within the buffer. An attribute marked invalid or absent has no value
+// to take; whatever stands in its place is passed over.
+#include <algorithm>
 #include <cstring>
 
-#include "mgmt/bnode_proto.h"
-#include "mgmt/bnode_proto_arrays.h"
-#include "mgmt/bnode_types.h"
+#include "mgmt/bnode.h"
+#include "mgmt/bnode_rows.h"
 #include "runtime/byte_order.h"
+#include "runtime/guards.h"
 #include "runtime/logging.h"
 
-// The fixed parts, where their bytes lie.
-struct bn_wire_request_header {
-    be16 service_id;
-    be16 msg_type;
-    be32 length; // of the whole frame, frame header included
-    be32 msg_id;
-    be32 transaction_id;
-};
-struct bn_wire_response_header {
-    be16 service_id;
-    be16 msg_type;
-    be32 length;
-    be32 msg_id;
-    be32 transaction_id;
-    be32 response_to;
-};
-static_assert(sizeof(bn_wire_request_header) == 16 && offsetof(bn_wire_request_header, msg_type) == 2);
-static_assert(offsetof(bn_wire_request_header, length) == 4 && offsetof(bn_wire_request_header, msg_id) == 8);
-static_assert(offsetof(bn_wire_request_header, transaction_id) == 12);
-static_assert(sizeof(bn_wire_response_header) == 20 && offsetof(bn_wire_response_header, response_to) == 16);
+enum : uint32_t { kind_wire_order = 1, kind_stored_order = 2, kind_counted = 4 };
+constexpr uint32_t HEADER_SIZE = 16, TYPE_OFFSET = 8, VALUE_OFFSET = 20;
+constexpr uint32_t ADDRESS_SIZE = 16;
 
-// --- Writing
-// --------------------------------------------------------------------------------------------------------
-
-static lc_status put_u32(tbuffer *buffer, uint32_t value) {
-    const be32 wire = to_be32(value);
-    CHECK_STATUS(tb_append_buf(buffer, wire.bytes, sizeof wire));
+static lc_status put_number(tbuffer *buffer, uint32_t offset, uint32_t value) {
+    return tb_put_uint32(buffer, offset, raw_word(to_be32(value)));
+}
+static lc_status get_number(const tbuffer *buffer, uint32_t offset, uint32_t *out) {
+    CHECK_STATUS(tb_get_uint32(buffer, offset, out));
+    *out = to_host(from_raw_word(*out));
     return LC_OK;
 }
-static lc_status put_u32_at(tbuffer *buffer, uint32_t offset, uint32_t value) {
-    const be32 wire = to_be32(value);
-    CHECK_STATUS(tb_put_buf(buffer, offset, wire.bytes, sizeof wire));
-    return LC_OK;
-}
-static lc_status put_string(tbuffer *buffer, const tstring *text) {
-    const int32_t length = text ? ts_length(text) : 0;
-    CHECK_STATUS(put_u32(buffer, static_cast<uint32_t>(length)));
-    if (length > 0)
-        CHECK_STATUS(tb_append_buf(buffer, ts_str(text), static_cast<uint32_t>(length)));
-    return LC_OK;
-}
-static uint32_t used(const tbuffer *buffer) {
-    return static_cast<uint32_t>(tb_length(buffer));
+
+// Stored bytes to wire bytes and back: numbers and addresses are turned around, a mask length behind an
+// address keeps its place.
+static void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
+    static_assert(std::endian::native == std::endian::little);
+    const uint32_t turned = std::min(size, ADDRESS_SIZE);
+    std::reverse_copy(from, from + turned, to);
+    memcpy(to + turned, from + turned, size - turned);
 }
 
-static lc_status put_name(tbuffer *buffer, const bn_binding *binding) {
-    const tstr_array *parts = nullptr;
-    int absolute = 0;
-    owned_tstr_array split;
-    CHECK_STATUS(bn_binding_get_name_parts_const(binding, &parts, &absolute));
-    if (!parts) {
-        CHECK_STATUS(bn_binding_name_to_parts(bn_binding_get_name_quick(binding), &split.pointer, &absolute));
-        parts = split.pointer;
+static lc_status put_header(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t kind) {
+    CHECK_NULL(attrib);
+    CHECK_STATUS(put_number(buffer, offset, kind));
+    CHECK_STATUS(put_number(buffer, offset + 4, attrib->attribute_id));
+    CHECK_STATUS(put_number(buffer, offset + TYPE_OFFSET, attrib->type));
+    CHECK_STATUS(put_number(buffer, offset + 12, attrib->type_flags));
+    return LC_OK;
+}
+
+static lc_status get_header(const tbuffer *buffer, uint32_t offset, uint32_t type, uint32_t kind,
+                            bn_attrib *attrib) {
+    uint32_t kind_read = 0, type_read = 0, flags = 0;
+    CHECK_STATUS(get_number(buffer, offset, &kind_read));
+    CHECK_STATUS(get_number(buffer, offset + 4, &attrib->attribute_id));
+    CHECK_STATUS(get_number(buffer, offset + TYPE_OFFSET, &type_read));
+    CHECK_STATUS(get_number(buffer, offset + 12, &flags));
+    if (kind_read != kind)
+        FAIL_WITH(LC_GENERIC);
+    if (type_read != type && type_read != 0) {
+        LC_LOG(LC_LOG_ERR, "Attribute of type %s, expected %s",
+               lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(type_read)),
+               lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(type)));
+        return LC_GENERIC;
     }
-    const uint8_t absolute_byte = absolute ? 1 : 0;
-    CHECK_STATUS(tb_append_uint8(buffer, absolute_byte));
-    const uint32_t count = tstr_array_length_quick(parts);
-    CHECK_STATUS(put_u32(buffer, count));
-    for (uint32_t i = 0; i < count; i++)
-        CHECK_STATUS(put_string(buffer, tstr_array_get_quick(parts, i)));
+    CHECK_CONDITION(bn_attrib_id_valid(attrib->attribute_id));
+    attrib->type = type;
+    attrib->type_flags = flags & ~BN_TYPE_MASK;
     return LC_OK;
 }
 
-static lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
-    const uint32_t count_at = used(buffer);
-    CHECK_STATUS(put_u32(buffer, 0));
-    uint32_t written = 0;
-    const bn_attrib_array *attributes = binding->attributes;
-    const uint32_t slots = bn_attrib_array_length_quick(attributes);
-    for (uint32_t id = 0; id < slots; id++) {
-        const bn_attrib *attribute = bn_attrib_array_get_quick(attributes, id);
-        if (!attribute)
-            continue;
-        CHECK_STATUS(bn_attrib_append_wire(attribute, buffer));
-        written++;
-    }
-    CHECK_STATUS(put_u32_at(buffer, count_at, written));
+static bool has_value(const bn_attrib *attrib) {
+    return !(attrib->type_flags & bn_flag_no_value);
+}
+
+// ---- Values in place behind a size
+
+static lc_status write_sized(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t kind,
+                             uint32_t *out_written) {
+    CHECK_STATUS(put_header(attrib, buffer, offset, kind));
+    const uint32_t size = attrib->value_size;
+    uint8_t bytes[sizeof attrib->value.bytes];
+    CHECK_CONDITION(size <= sizeof bytes);
+    if (kind == kind_wire_order)
+        turn(attrib->value.bytes, bytes, size);
+    else
+        memcpy(bytes, attrib->value.bytes, size);
+    CHECK_STATUS(put_number(buffer, offset + HEADER_SIZE, size));
+    CHECK_STATUS(tb_put_buf(buffer, offset + VALUE_OFFSET, bytes, size));
+    if (out_written)
+        *out_written = VALUE_OFFSET + size;
     return LC_OK;
 }
 
-static lc_status put_subop(tbuffer *buffer, const bn_request_node *node) {
-    CHECK_STATUS(put_u32(buffer, node->subop));
-    CHECK_STATUS(put_u32(buffer, node->flags));
-    return LC_OK;
-}
-static lc_status put_set_node(tbuffer *buffer, const bn_request_node *node) {
-    CHECK_STATUS(put_subop(buffer, node));
-    if (node->subop != bn_set_reparent)
-        return LC_OK;
-    CHECK_STATUS(put_string(buffer, node->source));
-    CHECK_STATUS(put_string(buffer, node->target));
-    return LC_OK;
-}
-static lc_status put_no_node(tbuffer *, const bn_request_node *) {
-    return LC_OK;
-}
-
-// Query: flags, database, revision condition. Set: commit flags, text, number.
-static lc_status put_options(tbuffer *buffer, const bn_request_msg *msg) {
-    CHECK_STATUS(put_u32(buffer, msg->flags));
-    CHECK_STATUS(put_string(buffer, msg->text));
-    CHECK_STATUS(put_u32(buffer, msg->number));
-    return LC_OK;
-}
-static lc_status put_message_name(tbuffer *buffer, const bn_request_msg *msg) {
-    CHECK_STATUS(put_string(buffer, msg->text));
-    return LC_OK;
-}
-
-// --- Reading
-// --------------------------------------------------------------------------------------------------------
-
-struct wire_reader {
-    const tbuffer *buffer;
-    uint32_t offset;
-};
-
-static lc_status get_bytes(wire_reader *reader, void *out, uint32_t count) {
-    const uint32_t length = used(reader->buffer);
-    CHECK_CONDITION(reader->offset <= length && count <= length - reader->offset);
-    memcpy(out, tb_buf(reader->buffer) + reader->offset, count);
-    reader->offset += count;
-    return LC_OK;
-}
-static lc_status get_u32(wire_reader *reader, uint32_t *out) {
-    be32 wire = {};
-    CHECK_STATUS(get_bytes(reader, wire.bytes, sizeof wire));
-    *out = to_host(wire);
-    return LC_OK;
-}
-// An absent string and one of length 0 are the same on the wire; both come back as an empty one.
-static lc_status get_string(wire_reader *reader, tstring **out) {
-    uint32_t length = 0;
-    CHECK_STATUS(get_u32(reader, &length));
-    if (length > used(reader->buffer) - reader->offset)
-        CHECK_STATUS(LC_NO_BUFFER_SPACE);
-    owned_tstring text;
-    CHECK_STATUS(ts_new_size(&text.pointer, length + 1));
-    if (length > 0)
-        CHECK_STATUS(ts_append_str_frag(
-            text.pointer, reinterpret_cast<const char *>(tb_buf(reader->buffer)) + reader->offset, 0,
-            static_cast<int32_t>(length)));
-    reader->offset += length;
-    *out = text.take();
-    return LC_OK;
-}
-
-static lc_status get_parts(wire_reader *reader, tstr_array **out) {
-    uint32_t count = 0;
-    CHECK_STATUS(get_u32(reader, &count));
-    owned_tstr_array parts;
-    CHECK_STATUS(tstr_array_new(&parts.pointer, nullptr));
-    for (uint32_t i = 0; i < count; i++) {
-        owned_tstring part;
-        CHECK_STATUS(get_string(reader, &part.pointer));
-        CHECK_STATUS(tstr_array_append_takeover(parts.pointer, &part.pointer));
-    }
-    *out = parts.take();
-    return LC_OK;
-}
-
-static lc_status get_attribute(wire_reader *reader, bn_attrib_array *attributes) {
-    owned_attrib attribute;
-    uint32_t count = 0;
-    CHECK_STATUS(bn_attrib_read_wire(reader->buffer, reader->offset, &attribute.pointer, &count));
-    reader->offset += count;
-    const uint32_t id = attribute.pointer->attribute_id;
-    CHECK_STATUS(bn_attrib_array_set_takeover(attributes, id, &attribute.pointer));
-    return LC_OK;
-}
-
-static lc_status get_binding(wire_reader *reader, bn_binding **out) {
-    uint8_t absolute = 0;
-    CHECK_STATUS(get_bytes(reader, &absolute, sizeof absolute));
-    owned_tstr_array parts;
-    CHECK_STATUS(get_parts(reader, &parts.pointer));
-    uint32_t count = 0;
-    CHECK_STATUS(get_u32(reader, &count));
-    owned_attribs attributes;
-    CHECK_STATUS(bn_attrib_array_new(&attributes.pointer));
-    for (uint32_t i = 0; i < count; i++)
-        CHECK_STATUS(get_attribute(reader, attributes.pointer));
-    tstring *name = nullptr;
-    CHECK_STATUS(bn_binding_new_parts_components_takeover(out, &name, &parts.pointer, absolute ? 1 : 0,
-                                                          &attributes.pointer));
-    return LC_OK;
-}
-
-static lc_status get_subop(wire_reader *reader, bn_request_node *node) {
-    CHECK_STATUS(get_u32(reader, &node->subop));
-    CHECK_STATUS(get_u32(reader, &node->flags));
-    return LC_OK;
-}
-static lc_status get_set_node(wire_reader *reader, bn_request_node *node) {
-    CHECK_STATUS(get_subop(reader, node));
-    if (node->subop != bn_set_reparent)
-        return LC_OK;
-    CHECK_STATUS(get_string(reader, &node->source));
-    CHECK_STATUS(get_string(reader, &node->target));
-    return LC_OK;
-}
-static lc_status get_no_node(wire_reader *, bn_request_node *) {
-    return LC_OK;
-}
-static lc_status get_options(wire_reader *reader, bn_request_msg *msg) {
-    CHECK_STATUS(get_u32(reader, &msg->flags));
-    CHECK_STATUS(get_string(reader, &msg->text));
-    CHECK_STATUS(get_u32(reader, &msg->number));
-    return LC_OK;
-}
-static lc_status get_message_name(wire_reader *reader, bn_request_msg *msg) {
-    CHECK_STATUS(get_string(reader, &msg->text));
-    return LC_OK;
-}
-
-// --- Requests
-// -------------------------------------------------------------------------------------------------------
-
-// What a request of each type has behind its nodes and behind itself.
-struct request_trailers {
-    uint16_t msg_type;
-    lc_status (*put_node)(tbuffer *buffer, const bn_request_node *node);
-    lc_status (*get_node)(wire_reader *reader, bn_request_node *node);
-    lc_status (*put_message)(tbuffer *buffer, const bn_request_msg *msg);
-    lc_status (*get_message)(wire_reader *reader, bn_request_msg *msg);
-};
-static const request_trailers request_types[] = {
-    {bn_msg_query_request, put_subop, get_subop, put_options, get_options},
-    {bn_msg_set_request, put_set_node, get_set_node, put_options, get_options},
-    {bn_msg_action_request, put_no_node, get_no_node, put_message_name, get_message_name},
-    {bn_msg_event, put_no_node, get_no_node, put_message_name, get_message_name},
-};
-
-static const request_trailers *trailers_of(uint16_t type) {
-    for (const request_trailers &known : request_types)
-        if (known.msg_type == type)
-            return &known;
-    LC_LOG(LC_LOG_ERR, "illegal messsage of type %d", type);
-    return nullptr;
-}
-
-static lc_status start_buffer(uint32_t header_bytes, owned_tbuffer *out) {
-    CHECK_STATUS(tb_new(&out->pointer));
-    const uint8_t zero = 0;
-    if (header_bytes > 0)
-        CHECK_STATUS(tb_put_buf(out->pointer, header_bytes - 1, &zero, 1));
-    return LC_OK;
-}
-
-lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, tbuffer **out) {
+static lc_status read_sized(const tbuffer *buffer, uint32_t offset, uint32_t type, uint32_t kind,
+                            bn_attrib **out, uint32_t *out_used) {
     CHECK_NULL(out);
     *out = nullptr;
-    CHECK_NULL(msg);
-    const request_trailers *trailers = trailers_of(msg->msg_type);
-    CHECK_CONDITION(trailers != nullptr);
-    owned_tbuffer buffer;
-    CHECK_STATUS(start_buffer(header_bytes, &buffer));
-    tbuffer *bytes = buffer.pointer;
-    bn_wire_request_header header = {};
-    msg->length = 0;
-    CHECK_STATUS(tb_append_buf(bytes, &header, sizeof header));
-    CHECK_STATUS(put_string(bytes, msg->audit_user));
-    const uint32_t count_at = used(bytes);
-    CHECK_STATUS(put_u32(bytes, 0));
-    uint32_t written = 0;
-    const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
-    for (uint32_t i = 0; i < count; i++) {
-        const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
-        if (!node || !node->binding)
-            continue;
-        CHECK_STATUS(put_u32(bytes, node->node_id));
-        CHECK_STATUS(put_name(bytes, node->binding));
-        CHECK_STATUS(put_attributes(bytes, node->binding));
-        CHECK_STATUS(trailers->put_node(bytes, node));
-        written++;
-    }
-    CHECK_STATUS(put_u32_at(bytes, count_at, written));
-    CHECK_STATUS(trailers->put_message(bytes, msg));
-    msg->length = used(bytes);
-    header = {to_be16(msg->service_id), to_be16(msg->msg_type), to_be32(msg->length), to_be32(msg->msg_id),
-              to_be32(msg->transaction_id)};
-    CHECK_STATUS(tb_put_buf(bytes, header_bytes, &header, sizeof header));
-    *out = buffer.take();
+    owned<bn_attrib, bn_release_attrib> attrib;
+    CHECK_STATUS(bn_attrib_new(&attrib.pointer));
+    CHECK_STATUS(get_header(buffer, offset, type, kind, attrib.pointer));
+    const bn_type_row *row = bn_type_find(type);
+    CHECK_NULL(row);
+    uint32_t size = 0;
+    CHECK_STATUS(get_number(buffer, offset + HEADER_SIZE, &size));
+    const bool empty = size == 0 && (attrib.pointer->type_flags & bn_flag_absent);
+    if (size != row->size && !empty)
+        FAIL_WITH(LC_GENERIC);
+    const uint32_t at = offset + VALUE_OFFSET;
+    CHECK_CONDITION(at <= buffer->length && size <= buffer->length - at);
+    if (has_value(attrib.pointer) && kind == kind_wire_order)
+        turn(buffer->buffer + at, attrib.pointer->value.bytes, size);
+    else if (has_value(attrib.pointer))
+        memcpy(attrib.pointer->value.bytes, buffer->buffer + at, size);
+    if (!(attrib.pointer->type_flags & bn_flag_absent))
+        attrib.pointer->value_size = size;
+    *out = attrib.take();
+    if (out_used)
+        *out_used = VALUE_OFFSET + size;
     return LC_OK;
 }
+lc_status bn_wire_write_number(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+                               uint32_t *out_written) {
+    return write_sized(attrib, buffer, offset, kind_wire_order, out_written);
+}
+lc_status bn_wire_read_number(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
+                              uint32_t *out_used) {
+    return read_sized(buffer, offset, type, kind_wire_order, out, out_used);
+}
+lc_status bn_wire_write_bytes(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+                              uint32_t *out_written) {
+    return write_sized(attrib, buffer, offset, kind_stored_order, out_written);
+}
+lc_status bn_wire_read_bytes(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
+                             uint32_t *out_used) {
+    return read_sized(buffer, offset, type, kind_stored_order, out, out_used);
+}
 
-lc_status bn_request_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
+// ---- Addresses: one or two leading bytes of the stored record, then the address
+
+static constexpr uint32_t stored_address = offsetof(lc_ipaddr, address);
+static_assert(stored_address == offsetof(lc_ipprefix, address));
+static_assert(offsetof(lc_ipprefix, family) == 0 && offsetof(lc_ipprefix, mask_length) == 1);
+
+static lc_status write_address(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t leading,
+                               uint32_t *out_written) {
+    CHECK_STATUS(put_header(attrib, buffer, offset, kind_wire_order));
+    uint8_t address[ADDRESS_SIZE];
+    turn(attrib->value.bytes + stored_address, address, ADDRESS_SIZE);
+    CHECK_STATUS(tb_put_buf(buffer, offset + HEADER_SIZE, attrib->value.bytes, leading));
+    CHECK_STATUS(tb_put_buf(buffer, offset + HEADER_SIZE + leading, address, ADDRESS_SIZE));
+    if (out_written)
+        *out_written = HEADER_SIZE + leading + ADDRESS_SIZE;
+    return LC_OK;
+}
+static lc_status read_address(const tbuffer *buffer, uint32_t offset, uint32_t type, uint32_t leading,
+                              bn_attrib **out, uint32_t *out_used) {
     CHECK_NULL(out);
     *out = nullptr;
+    owned<bn_attrib, bn_release_attrib> attrib;
+    CHECK_STATUS(bn_attrib_new(&attrib.pointer));
+    CHECK_STATUS(get_header(buffer, offset, type, kind_wire_order, attrib.pointer));
+    uint8_t address[ADDRESS_SIZE];
+    CHECK_STATUS(tb_get_uint128(buffer, offset + HEADER_SIZE + leading, address));
+    if (has_value(attrib.pointer)) {
+        memcpy(attrib.pointer->value.bytes, buffer->buffer + offset + HEADER_SIZE, leading);
+        turn(address, attrib.pointer->value.bytes + stored_address, ADDRESS_SIZE);
+    }
+    if (!(attrib.pointer->type_flags & bn_flag_absent))
+        attrib.pointer->value_size = sizeof(lc_ipaddr);
+    *out = attrib.take();
+    if (out_used)
+        *out_used = HEADER_SIZE + leading + ADDRESS_SIZE;
+    return LC_OK;
+}
+lc_status bn_wire_write_ipaddr(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+                               uint32_t *out_written) {
+    return write_address(attrib, buffer, offset, 1, out_written);
+}
+lc_status bn_wire_read_ipaddr(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
+                              uint32_t *out_used) {
+    return read_address(buffer, offset, type, 1, out, out_used);
+}
+lc_status bn_wire_write_ipprefix(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+                                 uint32_t *out_written) {
+    return write_address(attrib, buffer, offset, 2, out_written);
+}
+lc_status bn_wire_read_ipprefix(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
+                                uint32_t *out_used) {
+    return read_address(buffer, offset, type, 2, out, out_used);
+}
+
+// ---- Counted values
+
+static lc_status write_counted(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, const void *bytes,
+                               uint32_t length, uint32_t *out_written) {
+    CHECK_STATUS(put_header(attrib, buffer, offset, kind_counted));
+    CHECK_STATUS(put_number(buffer, offset + HEADER_SIZE, length));
+    CHECK_STATUS(tb_put_buf(buffer, offset + VALUE_OFFSET, bytes, length));
+    if (out_written)
+        *out_written = VALUE_OFFSET + length;
+    return LC_OK;
+}
+lc_status bn_wire_write_text(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+                             uint32_t *out_written) {
+    CHECK_NULL(attrib);
+    const tstring *text = attrib->value.string;
+    return write_counted(attrib, buffer, offset, ts_str_maybe(text),
+                         text ? static_cast<uint32_t>(text->length) : 0, out_written);
+}
+lc_status bn_wire_write_binary(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+                               uint32_t *out_written) {
+    CHECK_NULL(attrib);
+    const tbuffer *bytes = attrib->value.binary;
+    return write_counted(attrib, buffer, offset, tb_buf_maybe(bytes), bytes ? bytes->length : 0, out_written);
+}
+
+static lc_status take_text(bn_attrib *attrib, char **inout_bytes, uint32_t length) {
+    CHECK_STATUS(ts_new_str_takeover(&attrib->value.string, inout_bytes, static_cast<int32_t>(length), -1));
+    // A peer's text that isn't UTF-8 after all is told in the log and stays a plain text.
+    if (attrib->type == bn_type_utf8_string)
+        LOG_STATUS(ts_set_utf8(attrib->value.string, 1));
+    return LC_OK;
+}
+static lc_status take_binary(bn_attrib *attrib, char **inout_bytes, uint32_t length) {
+    auto *bytes = reinterpret_cast<uint8_t *>(*inout_bytes);
+    const lc_status status = tb_new_takeover(&attrib->value.binary, &bytes, length, length);
+    *inout_bytes = reinterpret_cast<char *>(bytes);
+    return status;
+}
+static lc_status read_counted(const tbuffer *buffer, uint32_t offset, uint32_t type,
+                              lc_status (*take)(bn_attrib *, char **, uint32_t), bn_attrib **out,
+                              uint32_t *out_used) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    owned<bn_attrib, bn_release_attrib> attrib;
+    owned_text bytes;
+    uint32_t length = 0, used = 0;
+    CHECK_STATUS(bn_attrib_new(&attrib.pointer));
+    CHECK_STATUS(get_header(buffer, offset, type, kind_counted, attrib.pointer));
+    CHECK_STATUS(tb_get_str(buffer, offset + HEADER_SIZE, -1, 0, 1, 1, &bytes.pointer, &length, &used));
+    if (has_value(attrib.pointer)) {
+        CHECK_STATUS(take(attrib.pointer, &bytes.pointer, length));
+        attrib.pointer->value_size = length;
+    }
+    *out = attrib.take();
+    if (out_used)
+        *out_used = HEADER_SIZE + used;
+    return LC_OK;
+}
+lc_status bn_wire_read_text(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
+                            uint32_t *out_used) {
+    return read_counted(buffer, offset, type, take_text, out, out_used);
+}
+lc_status bn_wire_read_binary(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
+                              uint32_t *out_used) {
+    return read_counted(buffer, offset, type, take_binary, out, out_used);
+}
+
+// ---- Through the table
+
+lc_status bn_attrib_append_wire(const bn_attrib *attrib, tbuffer *buffer) {
+    CHECK_NULL(attrib);
     CHECK_NULL(buffer);
-    wire_reader reader = {buffer, offset};
-    bn_wire_request_header header = {};
-    CHECK_STATUS(get_bytes(&reader, &header, sizeof header));
-    const request_trailers *trailers = trailers_of(to_host(header.msg_type));
-    CHECK_CONDITION(trailers != nullptr);
-    owned_request msg;
-    CHECK_STATUS(bn_request_msg_create(&msg.pointer, to_host(header.msg_type)));
-    msg.pointer->service_id = to_host(header.service_id);
-    msg.pointer->length = to_host(header.length);
-    msg.pointer->msg_id = to_host(header.msg_id);
-    msg.pointer->transaction_id = to_host(header.transaction_id);
-    CHECK_STATUS(get_string(&reader, &msg.pointer->audit_user));
-    uint32_t count = 0;
-    CHECK_STATUS(get_u32(&reader, &count));
-    for (uint32_t i = 0; i < count; i++) {
-        owned_request_node node(static_cast<bn_request_node *>(calloc(1, sizeof(bn_request_node))));
-        CHECK_NULL(node.pointer);
-        node.pointer->msg_type = msg.pointer->msg_type;
-        CHECK_STATUS(get_u32(&reader, &node.pointer->node_id));
-        CHECK_STATUS(get_binding(&reader, &node.pointer->binding));
-        CHECK_STATUS(trailers->get_node(&reader, node.pointer));
-        CHECK_STATUS(bn_request_per_node_array_append_takeover(msg.pointer->nodes, &node.pointer));
+    CHECK_CONDITION(attrib->type >= 1 && attrib->type <= BN_TYPE_LAST);
+    const bn_attrib_copy_func *row = &bn_attrib_copy_funcs[attrib->type];
+    if (!row->write) {
+        LC_LOG(LC_LOG_ERR, "Couldn't get attrib copy out func for type %s",
+               lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(attrib->type)));
+        return LC_NULL;
     }
-    CHECK_STATUS(trailers->get_message(&reader, msg.pointer));
-    *out = msg.take();
+    CHECK_STATUS(row->write(attrib, buffer, buffer->length, nullptr));
     return LC_OK;
 }
-
-// --- Responses
-// ------------------------------------------------------------------------------------------------------
-
-static bool has_revision(uint16_t msg_type) {
-    return msg_type == bn_msg_query_response || msg_type == bn_msg_set_response;
-}
-
-lc_status bn_response_msg_serialize(bn_response_msg *msg, uint32_t header_bytes, tbuffer **out) {
+lc_status bn_attrib_read_wire(const tbuffer *buffer, uint32_t offset, bn_attrib **out, uint32_t *out_used) {
     CHECK_NULL(out);
     *out = nullptr;
-    CHECK_NULL(msg);
-    owned_tbuffer buffer;
-    CHECK_STATUS(start_buffer(header_bytes, &buffer));
-    tbuffer *bytes = buffer.pointer;
-    bn_wire_response_header header = {};
-    msg->length = 0;
-    CHECK_STATUS(tb_append_buf(bytes, &header, sizeof header));
-    CHECK_STATUS(put_u32(bytes, msg->return_code));
-    CHECK_STATUS(put_string(bytes, msg->return_message));
-    const uint32_t count_at = used(bytes);
-    CHECK_STATUS(put_u32(bytes, 0));
-    uint32_t written = 0;
-    const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
-    for (uint32_t i = 0; i < count; i++) {
-        const bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
-        if (!node || !node->binding)
-            continue;
-        CHECK_STATUS(put_u32(bytes, node->node_id));
-        CHECK_STATUS(put_name(bytes, node->binding));
-        CHECK_STATUS(put_attributes(bytes, node->binding));
-        written++;
-    }
-    CHECK_STATUS(put_u32_at(bytes, count_at, written));
-    if (has_revision(msg->msg_type))
-        CHECK_STATUS(put_u32(bytes, msg->db_revision_id));
-    msg->length = used(bytes);
-    header = {to_be16(msg->service_id), to_be16(msg->msg_type),       to_be32(msg->length),
-              to_be32(msg->msg_id),     to_be32(msg->transaction_id), to_be32(msg->response_to)};
-    CHECK_STATUS(tb_put_buf(bytes, header_bytes, &header, sizeof header));
-    *out = buffer.take();
-    return LC_OK;
-}
-
-lc_status bn_response_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_response_msg **out) {
-    CHECK_NULL(out);
-    *out = nullptr;
-    CHECK_NULL(buffer);
-    wire_reader reader = {buffer, offset};
-    bn_wire_response_header header = {};
-    CHECK_STATUS(get_bytes(&reader, &header, sizeof header));
-    owned_response msg;
-    CHECK_STATUS(bn_response_msg_create(&msg.pointer, to_host(header.msg_type), to_host(header.response_to),
-                                        0, nullptr));
-    msg.pointer->service_id = to_host(header.service_id);
-    msg.pointer->length = to_host(header.length);
-    msg.pointer->msg_id = to_host(header.msg_id);
-    msg.pointer->transaction_id = to_host(header.transaction_id);
-    CHECK_STATUS(get_u32(&reader, &msg.pointer->return_code));
-    CHECK_STATUS(get_string(&reader, &msg.pointer->return_message));
-    uint32_t count = 0;
-    CHECK_STATUS(get_u32(&reader, &count));
-    for (uint32_t i = 0; i < count; i++) {
-        uint32_t node_id = 0;
-        owned_binding binding;
-        CHECK_STATUS(get_u32(&reader, &node_id));
-        CHECK_STATUS(get_binding(&reader, &binding.pointer));
-        CHECK_STATUS(bn_response_msg_append_binding_takeover(msg.pointer, &binding.pointer, node_id));
-    }
-    if (has_revision(msg.pointer->msg_type))
-        CHECK_STATUS(get_u32(&reader, &msg.pointer->db_revision_id));
-    *out = msg.take();
+    uint32_t type = 0;
+    CHECK_CONDITION(offset <= tb_size_max);
+    CHECK_STATUS(get_number(buffer, offset + TYPE_OFFSET, &type));
+    CHECK_CONDITION(type >= 1 && type <= BN_TYPE_LAST);
+    CHECK_NULL(bn_attrib_copy_funcs[type].read);
+    CHECK_STATUS(bn_attrib_copy_funcs[type].read(buffer, offset, type, out, out_used));
     return LC_OK;
 }

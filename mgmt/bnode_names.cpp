@@ -1,0 +1,122 @@
+// Names and patterns of names. An array of bindings is matched against a pattern name by name, so the match
+// of a text walks it in place: nothing is allocated for a name that doesn't match.
+#include "mgmt/bnode_names.h"
+
+#include <cstdlib>
+#include <cstring>
+
+#include "runtime/guards.h"
+
+constexpr char SEPARATOR = '/', ESCAPE = '\\';
+
+lc_status bn_binding_name_to_parts(const char *name, tstr_array **out_parts, int *out_absolute) {
+    CHECK_NULL(out_parts);
+    *out_parts = nullptr;
+    CHECK_NULL(name);
+    if (out_absolute)
+        *out_absolute = name[0] == SEPARATOR;
+    CHECK_STATUS(ts_tokenize_str(name, SEPARATOR, ESCAPE, 0,
+                                 ts_tok_keep_empty | ts_tok_skip_leading | ts_tok_empty_is_null, out_parts));
+    if (!*out_parts)
+        CHECK_STATUS(tstr_array_new(out_parts, nullptr));
+    return LC_OK;
+}
+lc_status bn_binding_name_parts_to_name_tstr(const tstr_array *parts, int absolute, tstring **out) {
+    CHECK_STATUS(ts_join_tokens(parts, SEPARATOR, ESCAPE, 0, absolute ? uint32_t{ts_join_leading} : 0, out));
+    return LC_OK;
+}
+lc_status bn_binding_name_parts_to_name(const tstr_array *parts, int absolute, char **out_text) {
+    CHECK_NULL(out_text);
+    *out_text = nullptr;
+    tstring *name = nullptr;
+    CHECK_STATUS(bn_binding_name_parts_to_name_tstr(parts, absolute, &name));
+    CHECK_STATUS(ts_detach(&name, out_text, nullptr));
+    return LC_OK;
+}
+
+// ---- Patterns
+
+lc_status bn_pattern_init(bn_pattern *pattern, const char *text) {
+    CHECK_STATUS(bn_binding_name_to_parts(text, &pattern->parts, &pattern->absolute));
+    return LC_OK;
+}
+bn_pattern::~bn_pattern() {
+    (void)tstr_array_free(&parts);
+}
+
+// The end of the part that begins at `name`.
+static const char *part_end(const char *name) {
+    for (; *name && *name != SEPARATOR; name++)
+        if (name[0] == ESCAPE && (name[1] == ESCAPE || name[1] == SEPARATOR))
+            name++;
+    return name;
+}
+static bool part_equals(const char *name, const char *end, const tstring *part) {
+    const char *wanted = part->buffer;
+    for (; name < end; name++, wanted++) {
+        if (name[0] == ESCAPE && (name[1] == ESCAPE || name[1] == SEPARATOR))
+            name++;
+        if (*name != *wanted)
+            return false;
+    }
+    return *wanted == 0;
+}
+static bool is_text(const tstring *part, const char *text) {
+    return strcmp(part->buffer, text) == 0;
+}
+static uint32_t parts_from(const char *name) {
+    uint32_t count = 1;
+    for (name = part_end(name); *name; name = part_end(name + 1))
+        count++;
+    return count;
+}
+
+bool bn_pattern_matches(const bn_pattern *pattern, const char *name) {
+    const uint32_t wanted_count = tstr_array_length_quick(pattern->parts);
+    if ((*name == SEPARATOR) != (pattern->absolute != 0))
+        return false;
+    name += *name == SEPARATOR;
+    if (!*name || !wanted_count)
+        return !*name && !wanted_count;
+    for (uint32_t i = 0; i < wanted_count; i++) {
+        const tstring *wanted = tstr_array_get_quick(pattern->parts, i);
+        const char *end = part_end(name);
+        if (!part_equals(name, end, wanted) && !is_text(wanted, "*"))
+            return is_text(wanted, "**") && wanted_count - i <= parts_from(name);
+        if (!*end)
+            return i + 1 == wanted_count;
+        name = end + 1;
+    }
+    return false;
+}
+bool bn_pattern_literal_start(const bn_pattern *pattern, tstring **out) {
+    *out = nullptr;
+    owned<tstring, ts_release> start;
+    if (ts_new_str(&start.pointer, pattern->absolute ? "/" : "") != LC_OK)
+        return false;
+    for (uint32_t i = 0; i < tstr_array_length_quick(pattern->parts); i++) {
+        const tstring *part = tstr_array_get_quick(pattern->parts, i);
+        if (strpbrk(part->buffer, "*\\/"))
+            break;
+        if (i > 0 && ts_append_char(start.pointer, SEPARATOR) != LC_OK)
+            return false;
+        if (ts_append(start.pointer, part) != LC_OK)
+            return false;
+    }
+    *out = start.take();
+    return true;
+}
+
+int bn_binding_name_pattern_match(const char *name, const char *pattern) {
+    bn_pattern made;
+    if (!name || !pattern || bn_pattern_init(&made, pattern) != LC_OK)
+        return 0;
+    return bn_pattern_matches(&made, name);
+}
+int bn_binding_name_parts_pattern_match(const tstr_array *parts, int absolute, const char *pattern) {
+    bn_pattern made;
+    int matched = 0;
+    if (!pattern || bn_pattern_init(&made, pattern) != LC_OK || !absolute != !made.absolute)
+        return 0;
+    return tstr_array_wildcard_match(made.parts, parts, &matched) == LC_OK && matched;
+}

@@ -1,0 +1,20 @@
+// Patterns split once and matched against many names.
+#pragma once
+
+#include "mgmt/bnode.h"
+
+struct bn_pattern {
+    tstr_array *parts = nullptr;
+    int absolute = 0;
+    bn_pattern() = default;
+    bn_pattern(const bn_pattern &) = delete;
+    bn_pattern &operator=(const bn_pattern &) = delete;
+    ~bn_pattern();
+};
+lc_status bn_pattern_init(bn_pattern *pattern, const char *text);
+// As splitting the name and tstr_array_wildcard_match.
+bool bn_pattern_matches(const bn_pattern *pattern, const char *name);
+// What every matching name begins with. False without memory.
+bool bn_pattern_literal_start(const bn_pattern *pattern, tstring **out);
+
+extern std::atomic<uint32_t> bn_binding_renames;
