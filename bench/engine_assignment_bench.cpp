@@ -173,7 +173,7 @@ void views_of_an_unchanged_report(benchmark::State &state) {
         md5_state md5;
         uint8_t digest[16];
         md5_init(&md5);
-        md5_append(&md5, message.data(), static_cast<int>(message.size()));
+        md5_append(&md5, message.data(), message.size());
         md5_finish(&md5, digest);
         benchmark::DoNotOptimize(digest);
     });
