@@ -1,0 +1,83 @@
+// Which interface is the appliance's primary WAN interface: told by the system mode and the bonding and speed
+// of its ports, which the management daemon knows. Main thread, from the engine's start.
+#include <cstring>
+
+#include "daemon/wccpd_main.h"
+#include "daemon/wccpd_mgmt.h"
+#include "engine/wccp_host.h"
+#include "mgmt/mdc_main.h"
+#include "mgmt/owners.h"
+#include "runtime/logging.h"
+
+constexpr const char *BONDING = "/qv/tunneld/system/config/bonding";
+constexpr const char *TEN_GIGABIT = "/qv/tunneld/system/config/10g";
+constexpr const char *MODE = "/qv/tunneld/system/config/mode";
+
+int32_t bonding_enabled;
+char wccp_primary_wan_interface_name[32];
+
+// A node that is absent leaves `out` as it is.
+static lc_status read_bool(mdc *handle, const char *node, int32_t *out, bool *out_present) {
+    *out_present = false;
+    owned_binding binding;
+    CHECK_STATUS(mdc_get_binding(handle, nullptr, nullptr, 0, &binding.pointer, node, nullptr));
+    if (!binding.pointer)
+        return LC_OK;
+    uint32_t value = 0;
+    CHECK_STATUS(bn_binding_get_tbool(binding.pointer, bn_attrib_value, nullptr, &value));
+    *out = value ? 1 : 0;
+    *out_present = true;
+    return LC_OK;
+}
+
+static lc_status mgmt_is_bonding_enabled(mdc *handle, int32_t *out) {
+    bool present = false;
+    *out = 0;
+    CHECK_STATUS(read_bool(handle, BONDING, out, &present));
+    return LC_OK;
+}
+
+static lc_status mgmt_is_10g_enabled(mdc *handle, int32_t *out) {
+    bool present = false;
+    *out = 0;
+    CHECK_STATUS(read_bool(handle, TEN_GIGABIT, out, &present));
+    return LC_OK;
+}
+
+static lc_status choose_name(const char *mode, const char **out_name) {
+    if (bonding_enabled) {
+        *out_name = "bwan0";
+        return LC_OK;
+    }
+    if (strncmp(mode, "server", 6) == 0) {
+        *out_name = "mgmt0";
+        return LC_OK;
+    }
+    int32_t bonding = 0, ten_gigabit = 0;
+    CHECK_STATUS(mgmt_is_bonding_enabled(wccpd_mcc, &bonding));
+    if (bonding) {
+        *out_name = "bwan0";
+        return LC_OK;
+    }
+    CHECK_STATUS(mgmt_is_10g_enabled(wccpd_mcc, &ten_gigabit));
+    *out_name = ten_gigabit ? "twan0" : "wan0";
+    return LC_OK;
+}
+
+lc_status wccp_init_primary_wan_interface() {
+    bool present = false;
+    CHECK_STATUS(read_bool(wccpd_mcc, BONDING, &bonding_enabled, &present));
+    if (present)
+        LC_LOG(LC_LOG_INFO, "bonding_enabled: %s", lc_bool_to_str(bonding_enabled));
+    owned_binding binding;
+    CHECK_STATUS(mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, MODE, nullptr));
+    CHECK_NULL(binding.pointer);
+    owned_tstring mode;
+    CHECK_STATUS(bn_binding_get_tstr(binding.pointer, bn_attrib_value, bn_type_str, nullptr, &mode.pointer));
+    CHECK_NULL(mode.pointer);
+    LC_LOG(LC_LOG_INFO, "system mode is %s", ts_str(mode.pointer));
+    const char *name = nullptr;
+    CHECK_STATUS(choose_name(ts_str(mode.pointer), &name));
+    strlcpy(wccp_primary_wan_interface_name, name, sizeof wccp_primary_wan_interface_name);
+    return LC_OK;
+}
