@@ -4,8 +4,12 @@
 
 #include <gtest/gtest.h>
 #include <pthread.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <chrono>
+#include <cstdlib>
 #include <cstring>
 #include <thread>
 #include <vector>
@@ -236,6 +240,33 @@ TEST_F(Mailbox, ACancelledWaiterLeavesTheMailboxUsable) {
         tunneld.answer_with(tunneld_does);
         uint32_t index = 0;
         EXPECT_EQ(wccp_add_tunnel_encap(2, address(1), address(2), &index), 0);
+    }
+}
+
+// The other side in a process of its own, which comes and goes.
+TEST_F(Mailbox, TheProgramAnswers) {
+    if (access(WCCP_BIN_DIR "/tunneld", X_OK) != 0)
+        GTEST_SKIP() << "tunneld is not built";
+    for (const char *const first_index : {"40", "90"}) {
+        const pid_t tunneld = fork();
+        if (tunneld == 0) {
+            if (freopen("/dev/null", "w", stdout))
+                execl(WCCP_BIN_DIR "/tunneld", "tunneld", "--index", first_index, nullptr);
+            _exit(127);
+        }
+        for (uint16_t id = 0; id < 20; id++) {
+            uint32_t index = WCCP_NO_INDEX;
+            EXPECT_EQ(wccp_add_tunnel_encap(id, address(1), address(id + 100u), &index), 0);
+            EXPECT_EQ(index, static_cast<uint32_t>(atoi(first_index)) + id);
+        }
+        uint32_t index = 0;
+        EXPECT_EQ(wccp_set_L2_return(51, 1), 0);
+        EXPECT_EQ(wccp_del_tunnel_encap(3, address(1), address(103), &index), 0);
+        EXPECT_EQ(wccp_del_tunnel_encap(3, address(1), address(103), &index), 1) << "it is gone";
+        kill(tunneld, SIGTERM);
+        int status = -1;
+        waitpid(tunneld, &status, 0);
+        EXPECT_EQ(status, 0);
     }
 }
 
