@@ -24,7 +24,6 @@
 #include "mgmt/client_session.h"
 #include "runtime/logging.h"
 
-gcl_session *qv_alm_mgmt_session;
 static lew *qv_alm_lwc;
 static mdc *qv_alm_mcc;
 static std::atomic<int32_t> qv_exiting;
