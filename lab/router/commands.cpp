@@ -150,8 +150,8 @@ static std::string do_members(const command_call &call) {
     for (const auto &[id, one] : in->members) {
         if (!one.usable)
             continue;
-        const auto share =
-            std::count_if(owners.begin(), owners.end(), [=](const address *owner) { return *owner == id; });
+        const auto share = std::count_if(owners.begin(), owners.end(),
+                                         [self = id](const address *owner) { return *owner == self; });
         lines += text_of(id) + " " + std::to_string(one.weight) + " " + std::to_string(share) + " " +
                  std::to_string(static_cast<int>(call.now - one.heard_at)) + (one.queried ? " 1\n" : " 0\n");
     }

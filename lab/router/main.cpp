@@ -225,6 +225,7 @@ static uint32_t bits_of(const std::vector<std::string> &words, const char *first
     return bits;
 }
 
+// NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
     CLI::App app("simulated WCCP version 2 routers");
     app.footer(std::string("Commands on standard input or through --control:\n") + ROUTER_COMMANDS);
