@@ -78,11 +78,10 @@ lc_status ht_new(ht **out, const ht_options *options) {
     auto *table = static_cast<ht *>(calloc(1, sizeof(ht)));
     CHECK_NULL(table);
     table->buckets = static_cast<ht_entry **>(calloc(ht_table_size_initial, sizeof(ht_entry *)));
-    if (!table->buckets)
+    if (!table->buckets) {
         free(table);
-    else
-        *out = table;
-    CHECK_NULL(*out);
+        FAIL_WITH(LC_NULL);
+    }
     table->bucket_count = ht_table_size_initial;
     table->refuse_duplicates = options->refuse_duplicates;
     table->hash_function = options->hash_function ? options->hash_function : defaults.hash_function;
@@ -91,6 +90,7 @@ lc_status ht_new(ht **out, const ht_options *options) {
     table->insert_function = options->insert_function;
     table->user_word = options->user_word;
     table->free_function = options->free_function;
+    *out = table;
     return LC_OK;
 }
 

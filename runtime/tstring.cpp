@@ -111,13 +111,13 @@ lc_status ts_new_size(tstring **out, uint32_t size) {
     auto *string = static_cast<tstring *>(calloc(1, sizeof(tstring)));
     CHECK_NULL(string);
     string->buffer = static_cast<char *>(malloc(size));
-    if (!string->buffer)
+    if (!string->buffer) {
         free(string);
-    else
-        *out = string;
-    CHECK_NULL(*out);
+        FAIL_WITH(LC_NULL);
+    }
     string->size = size;
     ended(string, 0);
+    *out = string;
     return LC_OK;
 }
 lc_status ts_new(tstring **out) {
