@@ -18,7 +18,9 @@
 #include <cstdlib>
 #include <cstring>
 
+#include <fcntl.h>
 #include <numa.h>
+#include <signal.h>
 #include <sys/shm.h>
 #include <unistd.h>
 
@@ -29,6 +31,7 @@
 constexpr uint32_t MAX_BLOCKS = 2000;
 constexpr uint32_t MAX_CONF = 400;
 constexpr uint32_t NAME_BYTES = 32;
+constexpr size_t CONF_LINE_BYTES = 256;
 constexpr uint64_t NORMAL_PAGE = 4096;
 constexpr uint64_t HUGE_PAGE_BYTES = 0x200000;
 constexpr int SHARED_MODE = 0777;
@@ -45,7 +48,7 @@ struct cmem_block {
     uint64_t zero;
     uint64_t attach_address; // requested, 0 for any
     uint64_t creator_address;
-    int32_t pid;
+    std::atomic<int32_t> pid;
     uint32_t alignment;
     uint64_t counters[4];
     uint32_t diagnostic;
@@ -84,14 +87,7 @@ static_assert(sizeof(cmem_registry) == 361608);
 static cmem_registry *registry;
 static pthread_mutex_t registry_lock = PTHREAD_MUTEX_INITIALIZER;
 
-#define CMEM_LOG(level, ...)                                                                                 \
-    do {                                                                                                     \
-        if (lc_log_check_level(level))                                                                       \
-            (void)qv_log_internal((level), nullptr, nullptr, __VA_ARGS__);                                   \
-    } while (0)
-
 // --- mem.conf
-// -------------------------------------------------------------------------------------------------------
 
 static bool parse_node(const char *word, int32_t *out) {
     if (strcmp(word, "inter") == 0)
@@ -119,44 +115,68 @@ static bool parse_page_size(const char *word, uint64_t *out) {
     return true;
 }
 
+// The next word of a line, cut off with a NUL; the empty one at the end of the line.
+static char *next_word(char **inout_text) {
+    char *word = *inout_text + strspn(*inout_text, " \t");
+    char *end = word + strcspn(word, " \t");
+    *inout_text = *end ? end + 1 : end;
+    *end = '\0';
+    return word;
+}
+
+// A hexadecimal number of at most `limit`, else 0: no key, and no address.
+static uint64_t parse_hex(const char *word, uint64_t limit) {
+    char *end = nullptr;
+    errno = 0;
+    const unsigned long long number = strtoull(word, &end, 16);
+    return errno == 0 && *end == '\0' && word[0] != '-' && number <= limit ? number : 0;
+}
+
 // False for a line that is passed over.
-static bool parse_conf_line(const char *line, cmem_conf *out) {
-    char name[128], node[32], page[32], key[32], address[32] = "0";
-    const char *text = line + strspn(line, " \t");
-    if (*text == '#' || sscanf(text, "%127s %31s %31s %31s %31s", name, node, page, key, address) < 4)
+static bool parse_conf_line(char *line, cmem_conf *out) {
+    char whole[CONF_LINE_BYTES];
+    strlcpy(whole, line, sizeof whole);
+    const char *name = next_word(&line);
+    if (name[0] == '#' || name[0] == '\0')
         return false;
     *out = {};
-    name[NAME_BYTES - 1] = '\0';
-    memcpy(out->name, name, strlen(name));
-    if (!parse_node(node, &out->node)) {
-        CMEM_LOG(LC_LOG_ERR, "%s: error parsing affinity at line %s\n", __func__, line);
+    memcpy(out->name, name, strnlen(name, NAME_BYTES - 1));
+    if (!parse_node(next_word(&line), &out->node)) {
+        QV_LOG(LC_LOG_ERR, "%s: error parsing affinity at line %s\n", "cmem_load_conf", whole);
         return false;
     }
-    if (!parse_page_size(page, &out->page_size)) {
-        CMEM_LOG(LC_LOG_ERR, "%s: error parsing page size at line %s\n", __func__, line);
+    if (!parse_page_size(next_word(&line), &out->page_size)) {
+        QV_LOG(LC_LOG_ERR, "%s: error parsing page size at line %s\n", "cmem_load_conf", whole);
         return false;
     }
-    out->key = static_cast<uint32_t>(strtoul(key, nullptr, 16));
-    out->attach_address = strtoull(address, nullptr, 16);
+    out->key = static_cast<uint32_t>(parse_hex(next_word(&line), UINT32_MAX));
+    if (out->key == static_cast<uint32_t>(CMEM_REGISTRY_KEY))
+        out->key = 0; // a block there would wipe out the registry
+    out->attach_address = parse_hex(next_word(&line), UINT64_MAX);
     return true;
 }
 
+// Fills at most all entries of a registry that this process is loading.
 static void load_conf(cmem_registry *fresh) {
     FILE *file = fopen(CMEM_CONF_PATH, "re");
     if (!file)
         return;
-    char line[256];
-    uint32_t count = 0;
-    for (uint32_t read = 0; read < MAX_CONF && fgets(line, sizeof line, file); read++) {
-        line[strcspn(line, "\n")] = '\0';
-        if (parse_conf_line(line, &fresh->conf[count]))
-            count++;
+    char line[CONF_LINE_BYTES];
+    cmem_conf entry;
+    bool inside = false; // of a line longer than the buffer: the rest of it is passed over
+    for (uint32_t count = 0; count < MAX_CONF && fgets(line, sizeof line, file);) {
+        const bool rest = inside;
+        char *end = strpbrk(line, "\r\n");
+        inside = !end && strlen(line) == sizeof line - 1;
+        if (end)
+            *end = '\0';
+        if (!rest && parse_conf_line(line, &entry))
+            fresh->conf[count++] = entry;
     }
     fclose(file);
 }
 
 // --- The registry
-// ---------------------------------------------------------------------------------------------------
 
 // Bytes behind a segment, 0 when it cannot be told.
 static uint64_t segment_bytes(int id) {
@@ -168,15 +188,11 @@ static cmem_registry *attach_registry() {
     const mutex_guard guard(&registry_lock);
     if (registry)
         return registry;
-    const int id = shmget(CMEM_REGISTRY_KEY, 0, 0);
-    const int made = id >= 0 ? id : shmget(CMEM_REGISTRY_KEY, sizeof(cmem_registry), IPC_CREAT | SHARED_MODE);
-    void *memory = reinterpret_cast<void *>(-1);
-    if (made >= 0 && segment_bytes(made) < sizeof(cmem_registry))
-        errno = EINVAL;
-    else if (made >= 0)
-        memory = shmat(made, nullptr, 0);
+    // Another's segment that is shorter gives EINVAL here.
+    const int id = shmget(CMEM_REGISTRY_KEY, sizeof(cmem_registry), IPC_CREAT | SHARED_MODE);
+    void *memory = id >= 0 ? shmat(id, nullptr, 0) : reinterpret_cast<void *>(-1);
     if (memory == reinterpret_cast<void *>(-1)) {
-        CMEM_LOG(LC_LOG_ERR, "%s: Cannot attach to shmem, err=%s\n", __func__, strerror(errno));
+        QV_LOG(LC_LOG_ERR, "%s: Cannot attach to shmem, err=%s\n", "cmem_attach_registry", strerror(errno));
         abort();
     }
     cmem_registry *attached = static_cast<cmem_registry *>(memory);
@@ -212,43 +228,52 @@ static void free_block(cmem_block *block) {
     block->in_use = 0;
 }
 
-static bool creator_lives(const cmem_block *block) {
+// By the creator's numa_maps; where the kernel has none at all, by its process id.
+static bool creator_lives(int32_t pid) {
     char path[64];
-    snprintf(path, sizeof path, "/proc/%d/numa_maps", block->pid);
-    FILE *file = fopen(path, "re");
-    if (!file)
-        return false;
-    fclose(file);
-    return true;
+    snprintf(path, sizeof path, "/proc/%d/numa_maps", pid);
+    const int fd = open(path, O_RDONLY | O_CLOEXEC);
+    if (fd >= 0)
+        close(fd);
+    return fd >= 0 || (access("/proc/self/numa_maps", F_OK) != 0 && pid > 0 && kill(pid, 0) == 0);
 }
 
 static uint64_t round_up(uint64_t length, uint64_t page) {
-    return (length + page - 1) / page * page;
+    return length > UINT64_MAX - page ? UINT64_MAX / page * page : (length + page - 1) / page * page;
 }
 
-static void reset_block(cmem_block *block, const cmem_registry *known, const char *name) {
-    block->length = 0;
-    block->page_size = NORMAL_PAGE;
-    block->node = NODE_LOCAL;
-    block->key = 0;
+static const cmem_conf *find_conf(const cmem_registry *known, const char *name) {
+    for (const cmem_conf &entry : known->conf)
+        if (entry.name[0] && strncmp(entry.name, name, NAME_BYTES - 1) == 0)
+            return &entry;
+    return nullptr;
+}
+
+// Fills a claimed record. The name, by which others find it, comes last.
+static void reset_block(cmem_block *block, const cmem_registry *known, const char *name, uint64_t length) {
+    static const cmem_conf unlisted = {{}, NORMAL_PAGE, 0, NODE_LOCAL, 0, 0};
+    const cmem_conf *entry = find_conf(known, name);
+    block->configured = entry != nullptr;
+    if (!entry)
+        entry = &unlisted;
+    block->length = round_up(length, entry->page_size);
+    block->page_size = entry->page_size;
+    block->node = entry->node;
+    block->key = entry->key;
     block->zero = 0;
-    block->attach_address = 0;
+    block->attach_address = entry->attach_address;
     block->creator_address = 0;
     block->pid = getpid();
     memset(block->counters, 0, sizeof block->counters);
     block->diagnostic = 0;
-    block->configured = 0;
-    strlcpy(block->name, name, sizeof block->name);
     strlcpy(block->owner, program_invocation_short_name, sizeof block->owner);
-    for (const cmem_conf &entry : known->conf)
-        if (entry.name[0] && strncmp(entry.name, block->name, NAME_BYTES) == 0) {
-            block->page_size = entry.page_size;
-            block->node = entry.node;
-            block->key = entry.key;
-            block->attach_address = entry.attach_address;
-            block->configured = 1;
-            break;
-        }
+    std::atomic_thread_fence(std::memory_order_release);
+    strlcpy(block->name, name, sizeof block->name);
+}
+
+static void log_double_create(const char *name, int32_t old_pid, int32_t new_pid) {
+    QV_LOG(LC_LOG_ERR, "%s: double create attempt for memory block %s, old pid=%d, new pid=%d\n",
+           "cmem_create_block", name, old_pid, new_pid);
 }
 
 // The record to use for a name: a new one, or the one of a creator that has gone.
@@ -257,19 +282,25 @@ static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t l
     if (!block) {
         block = claim_block(known);
         if (!block)
-            CMEM_LOG(LC_LOG_ERR, "%s: out of memory tracking blocks\n", "cmem_create_block");
+            QV_LOG(LC_LOG_ERR, "%s: out of memory tracking blocks\n", "cmem_create_block");
         return block;
     }
-    if (creator_lives(block)) {
-        CMEM_LOG(LC_LOG_ERR, "%s: double create attempt for memory block %s, old pid=%d, new pid=%d\n",
-                 "cmem_create_block", name, block->pid, static_cast<int>(getpid()));
+    const int32_t old_pid = block->pid;
+    const int32_t new_pid = getpid();
+    if (creator_lives(old_pid)) {
+        log_double_create(name, old_pid, new_pid);
         return nullptr;
     }
     const uint64_t rounded = round_up(length, block->page_size ? block->page_size : NORMAL_PAGE);
     if (rounded != block->length) {
-        CMEM_LOG(LC_LOG_NOTICE, "%s: length change attempt for memory block %s, old len=%lu, new len=%lu\n",
-                 "cmem_create_block", name, static_cast<unsigned long>(block->length),
-                 static_cast<unsigned long>(rounded));
+        QV_LOG(LC_LOG_NOTICE, "%s: length change attempt for memory block %s, old len=%lu, new len=%lu\n",
+               "cmem_create_block", name, static_cast<unsigned long>(block->length),
+               static_cast<unsigned long>(rounded));
+        return nullptr;
+    }
+    int32_t expected = old_pid;
+    if (!block->pid.compare_exchange_strong(expected, new_pid)) {
+        log_double_create(name, expected, new_pid); // another process has just taken it over
         return nullptr;
     }
     return block;
@@ -277,6 +308,8 @@ static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t l
 
 static void place_on_node(void *memory, const cmem_block *block) {
     if (numa_available() < 0)
+        return;
+    if (block->node > numa_max_node())
         return;
     if (block->node >= 0)
         numa_tonode_memory(memory, block->length, block->node);
@@ -287,19 +320,20 @@ static void place_on_node(void *memory, const cmem_block *block) {
 }
 
 void *cmem_create_block(uint64_t length, const char *name) {
+    if (!name || !*name)
+        return nullptr;
     const cancel_off_guard uncancelled;
     cmem_registry *known = attach_registry();
     cmem_block *block = take_block(known, name, length);
     if (!block)
         return nullptr;
-    reset_block(block, known, name);
+    reset_block(block, known, name, length);
     if (block->key == 0) {
-        CMEM_LOG(LC_LOG_ERR, "%s: attempt to create shared block %s conflicts with conf file\n", __func__,
-                 name);
+        QV_LOG(LC_LOG_ERR, "%s: attempt to create shared block %s conflicts with conf file\n", __func__,
+               name);
         free_block(block);
         return nullptr;
     }
-    block->length = round_up(length, block->page_size);
     const int key = static_cast<int>(block->key);
     int id = shmget(key, 0, 0);
     const bool fresh = id < 0;
@@ -311,7 +345,7 @@ void *cmem_create_block(uint64_t length, const char *name) {
         id = -1;
     }
     if (id < 0) {
-        CMEM_LOG(
+        QV_LOG(
             LC_LOG_ERR,
             "%s: cannot attach/shmget shared block %s, length=%ld, key=%x, pagesize=%ld, shmid=%d, err=%s, "
             "errno=%d, check SHMMAX\n",
@@ -322,8 +356,8 @@ void *cmem_create_block(uint64_t length, const char *name) {
     }
     void *memory = shmat(id, reinterpret_cast<const void *>(block->attach_address), 0);
     if (memory == reinterpret_cast<void *>(-1)) {
-        CMEM_LOG(LC_LOG_ERR, "%s: cannot attach/shmat shared block %s, length=%ld, shmid=%d, err=%s\n",
-                 __func__, name, static_cast<long>(block->length), id, strerror(errno));
+        QV_LOG(LC_LOG_ERR, "%s: cannot attach/shmat shared block %s, length=%ld, shmid=%d, err=%s\n",
+               __func__, name, static_cast<long>(block->length), id, strerror(errno));
         free_block(block);
         return nullptr;
     }
@@ -342,19 +376,13 @@ int cmem_exists_block(const char *name) {
         const mutex_guard guard(&registry_lock);
         known = registry;
     }
-    if (!known) {
-        // Looks on without making a registry: a process that only asks sees none until somebody has made it.
-        const int id = shmget(CMEM_REGISTRY_KEY, 0, 0);
-        if (id < 0 || segment_bytes(id) < sizeof(cmem_registry))
-            return 0;
-        known = attach_registry();
-    }
+    if (!known || !name || !*name)
+        return 0;
     const cmem_block *block = find_block(known, name);
     if (!block)
         return 0;
     if (shmget(static_cast<int>(block->key), 0, 0) < 0) {
-        CMEM_LOG(LC_LOG_ERR, "%s: cannot shmget to shared block %s, err=%s\n", __func__, name,
-                 strerror(errno));
+        QV_LOG(LC_LOG_ERR, "%s: cannot shmget to shared block %s, err=%s\n", __func__, name, strerror(errno));
         return 0;
     }
     return 1;
@@ -365,36 +393,40 @@ void *cmem_attach_block(const char *name, uint64_t *out_length) {
     if (out_length)
         *out_length = 0;
     cmem_registry *known = attach_registry();
-    const cmem_block *block = find_block(known, name);
+    const cmem_block *block = name && *name ? find_block(known, name) : nullptr;
     if (!block) {
-        CMEM_LOG(LC_LOG_WARNING, "%s: memory block %s not found\n", __func__, name);
+        QV_LOG(LC_LOG_WARNING, "%s: memory block %s not found\n", __func__, name ? name : "");
         return nullptr;
     }
     if (block->key == 0) {
-        CMEM_LOG(LC_LOG_ERR, "%s: memory block %s is not shared\n", __func__, name);
+        QV_LOG(LC_LOG_ERR, "%s: memory block %s is not shared\n", __func__, name);
         return nullptr;
     }
-    const int id = shmget(static_cast<int>(block->key), 0, 0);
+    int id = shmget(static_cast<int>(block->key), 0, 0);
+    const uint64_t held = id >= 0 ? segment_bytes(id) : 0;
+    if (id >= 0 && (held == 0 || round_up(held, NORMAL_PAGE) < block->length)) {
+        errno = EINVAL;
+        id = -1;
+    }
     if (id < 0) {
-        CMEM_LOG(LC_LOG_WARNING, "%s: cannot shmget shared block %s, key=%u, err=%s\n", __func__, name,
-                 block->key, strerror(errno));
+        QV_LOG(LC_LOG_WARNING, "%s: cannot shmget shared block %s, key=%u, err=%s\n", __func__, name,
+               block->key, strerror(errno));
         return nullptr;
     }
     const void *address = reinterpret_cast<const void *>(block->attach_address);
     void *memory = shmat(id, address, 0);
     if (memory == reinterpret_cast<void *>(-1)) {
-        CMEM_LOG(LC_LOG_WARNING,
-                 "%s: cannot attach to shared block %s, err=%s, shmid=%x, p->addr=%p, shmflag=%x\n", __func__,
-                 name, strerror(errno), static_cast<unsigned>(id), address, 0U);
+        QV_LOG(LC_LOG_WARNING,
+               "%s: cannot attach to shared block %s, err=%s, shmid=%x, p->addr=%p, shmflag=%x\n", __func__,
+               name, strerror(errno), static_cast<unsigned>(id), address, 0U);
         return nullptr;
     }
     if (out_length)
-        *out_length = segment_bytes(id);
+        *out_length = held;
     return memory;
 }
 
 // --- Mutexes
-// --------------------------------------------------------------------------------------------------------
 
 struct cmutex {
     char name[NAME_BYTES];
@@ -417,8 +449,8 @@ void cmutex_free(cmutex **inout_mutex) {
     *inout_mutex = nullptr;
 }
 int cmutex_lock(cmutex *mutex) {
-    return mutex ? pthread_mutex_lock(&mutex->mutex) : EINVAL;
+    return mutex ? pthread_mutex_lock(&mutex->mutex) : 1;
 }
 int cmutex_unlock(cmutex *mutex) {
-    return mutex ? pthread_mutex_unlock(&mutex->mutex) : EINVAL;
+    return mutex ? pthread_mutex_unlock(&mutex->mutex) : 1;
 }

@@ -64,7 +64,6 @@ const lc_enum_entry lc_status_table[] = {
 };
 
 // --- The failure checks
-// ---------------------------------------------------------------------------------------------
 
 // Kept out of line and never empty to the optimiser, so that a breakpoint holds.
 __attribute__((noinline)) void bail_debug() {
@@ -117,7 +116,6 @@ lc_status lc_check_forced(lc_status status, const char *function, const char *fi
 }
 
 // --- Enumeration tables
-// ---------------------------------------------------------------------------------------------
 
 static const char *find_name(const lc_enum_entry *table, int32_t value) {
     for (const lc_enum_entry *entry = table; entry->name; entry++)
@@ -209,7 +207,6 @@ const char *lc_signal_num_to_name(int number) {
 }
 
 // --- Strings
-// --------------------------------------------------------------------------------------------------------
 
 char *safe_strdup(const char *string) {
     return string ? strdup(string) : nullptr;
@@ -292,9 +289,9 @@ lc_status snmprintf(char **out_string, uint32_t *out_length, const char *format,
 }
 
 // --- Environment
-// ----------------------------------------------------------------------------------------------------
 
-// lc_env_lock when it exists; before lc_init there is only one thread.
+// lc_env_lock when it exists; before lc_init there is only one thread. The log takes it under its own lock
+// when the time zone changes, so nothing is logged while it is held.
 struct env_guard {
     env_guard() : held(lc_env_lock) {
         if (held)
@@ -313,13 +310,20 @@ lc_status lc_getenv_ts(const char *name, char **out_text) {
     CHECK_NULL(out_text);
     *out_text = nullptr;
     CHECK_NULL(name);
-    const env_guard guard;
-    const char *value = getenv(name);
-    if (!value)
-        return LC_OK;
-    *out_text = strdup(value);
-    CHECK_NULL(*out_text);
+    bool found = false;
+    {
+        const env_guard guard;
+        const char *value = getenv(name);
+        found = value != nullptr;
+        *out_text = safe_strdup(value);
+    }
+    CHECK_CONDITION(!found || *out_text);
     return LC_OK;
+}
+
+static int set_locked(const char *name, const char *value, int overwrite) {
+    const env_guard guard;
+    return setenv(name, value, overwrite);
 }
 
 lc_status lc_setenv(const char *name, const char *value, int overwrite) {
@@ -329,8 +333,7 @@ lc_status lc_setenv(const char *name, const char *value, int overwrite) {
         LC_LOG(LC_LOG_ERR, "Environment variable name \"%s\" contains illegal character '='", name);
         return LC_GENERIC;
     }
-    const env_guard guard;
-    CHECK_CONDITION(setenv(name, value, overwrite) == 0);
+    CHECK_CONDITION(set_locked(name, value, overwrite) == 0);
     return LC_OK;
 }
 
@@ -342,7 +345,6 @@ int lc_devel_is_production() {
 }
 
 // --- Locks
-// ----------------------------------------------------------------------------------------------------------
 
 lc_lock *lc_env_lock, *lc_dso_lock, *lc_utmpx_lock;
 
@@ -403,7 +405,8 @@ int lc_lock_lock(lc_lock *lock) {
     lock->owner = this_thread();
     lock->locked = 1;
     if (lock->nesting++ == 0)
-        pthread_setspecific(lock->key, lock);
+        (void)pthread_setspecific(lock->key,
+                                  lock); // fails only for want of memory, and costs only the release
     return 0;
 }
 

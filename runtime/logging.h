@@ -73,6 +73,8 @@ const char *lc_log_get_lls_process_name();
 lc_status lc_log_get_syslog_facility(int32_t *out_facility);
 lc_status lc_log_set_override_log_level(const char *name);
 lc_status lc_log_enable_override_log_level(int32_t system_wide, int32_t enable);
+// Lines of the calling thread carry this number from now on, in the place of the system's.
+lc_status lc_log_set_thread_id(uint32_t logged_id);
 
 // The facility of a process: from its file, or with a session from the management tree, for which the host of
 // this room lends `lc_log_facility_from_session` (null until it does).

@@ -5,17 +5,27 @@
 // whole and in order. Once the patience is used up a line is tried and given up at once, until one gets
 // through, which restores it.
 //
-// A daemon that goes takes its socket along: the next line connects again. Without /dev/log lines are lost
-// quietly.
+// The wait is made of short steps with a try after each: the kernel tells that a socket has room only when
+// half of its send buffer is free, which a slow daemon may take long for, while a line fits much earlier.
+//
+// A daemon that goes takes its socket along: the next line connects again. One that stands still while
+// another takes over its path is noticed by the socket file when a line would be lost. Without /dev/log lines
+// are lost quietly, at the price of a failed connect. As in the C library, a /dev/log that is a stream gets
+// each line with its NUL.
+//
+// One line is made in a buffer of this file, under the log's lock; only a line that is longer allocates.
 #include "runtime/syslog_socket.h"
 
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <ctime>
 
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -23,7 +33,20 @@
 #include "runtime/common.h"
 
 constexpr const char *LOG_PATH = "/dev/log";
-constexpr size_t LINE_BYTES = 6144;
+constexpr size_t LINE_BYTES = 4096;
+constexpr int64_t WAIT_STEP_NS = 500000;
+constexpr int64_t SECOND_NS = 1000000000;
+
+// The C library's own mask stands behind a lock which another thread's blocked syslog call may hold.
+static std::atomic<int32_t> mask{0xff};
+
+void syslog_set_mask(int32_t level) {
+    mask = (1 << ((level + 1) & 31)) - 1;
+}
+
+int32_t syslog_get_mask() {
+    return mask;
+}
 
 void syslog_socket_close(syslog_socket *log) {
     if (log->fd >= 0)
@@ -38,6 +61,8 @@ static int connect_as(syslog_socket *log, int type) {
     sockaddr_un address = {};
     address.sun_family = AF_UNIX;
     strlcpy(address.sun_path, LOG_PATH, sizeof address.sun_path);
+    struct stat file = {};
+    (void)stat(LOG_PATH, &file); // ahead of the connect: a later change is then seen as one
     if (connect(fd, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0) {
         const int failure = errno;
         close(fd);
@@ -45,6 +70,8 @@ static int connect_as(syslog_socket *log, int type) {
     }
     log->fd = fd;
     log->stream = type == SOCK_STREAM;
+    log->device = file.st_dev;
+    log->inode = file.st_ino;
     return 0;
 }
 
@@ -53,35 +80,41 @@ static int connect_to_daemon(syslog_socket *log) {
     return result == EPROTOTYPE ? connect_as(log, SOCK_STREAM) : result;
 }
 
+static bool path_is_anothers(const syslog_socket *log) {
+    struct stat file = {};
+    return stat(LOG_PATH, &file) == 0 && (file.st_dev != log->device || file.st_ino != log->inode);
+}
+
 void syslog_socket_open(syslog_socket *log, const char *ident, bool with_pid, int32_t facility) {
     strlcpy(log->ident, ident, sizeof log->ident);
     log->with_pid = with_pid;
-    log->facility = facility;
+    log->facility = facility & ~LOG_FACMASK ? LOG_USER : facility;
     log->fd = -1;
-    log->patience_ms = SYSLOG_PATIENCE_MS;
+    log->patience_ns = SYSLOG_PATIENCE_NS;
     (void)connect_to_daemon(log);
 }
 
-static int64_t now_ms() {
+static int64_t now_ns() {
     timespec now;
     clock_gettime(CLOCK_MONOTONIC, &now);
-    return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
+    return now.tv_sec * SECOND_NS + now.tv_nsec;
 }
 
-// Waits for room, on account of the patience. False when there is none left.
+// Waits a step for room, on account of the patience. False when there is none left.
 static bool wait_for_room(syslog_socket *log) {
-    if (log->patience_ms <= 0)
+    if (log->patience_ns <= 0)
         return false;
+    const timespec step = {0, log->patience_ns < WAIT_STEP_NS ? log->patience_ns : WAIT_STEP_NS};
     pollfd writable = {log->fd, POLLOUT, 0};
-    const int64_t began = now_ms();
-    (void)poll(&writable, 1, log->patience_ms);
-    const int64_t waited = now_ms() - began;
-    log->patience_ms -= static_cast<int32_t>(waited < log->patience_ms ? waited : log->patience_ms);
+    const int64_t began = now_ns();
+    (void)ppoll(&writable, log->fd >= 0, &step, nullptr);
+    const int64_t waited = now_ns() - began;
+    log->patience_ns -= waited > 1000 ? waited : 1000; // a wait that finds room each time ends as well
     return true;
 }
 
 // Sends all of a line on the present connection: 0, or the errno of what stopped it.
-static int send_line(syslog_socket *log, const char *line, size_t length) {
+static int send_whole(syslog_socket *log, const char *line, size_t length) {
     size_t sent = 0;
     while (sent < length) {
         const ssize_t went = send(log->fd, line + sent, length - sent, MSG_DONTWAIT | MSG_NOSIGNAL);
@@ -97,39 +130,77 @@ static int send_line(syslog_socket *log, const char *line, size_t length) {
             return errno;
         }
     }
-    log->patience_ms = SYSLOG_PATIENCE_MS;
     return 0;
 }
 
-int syslog_socket_send(syslog_socket *log, int32_t level, const char *text, size_t length) {
-    if (!(LOG_MASK(level) & setlogmask(0)))
-        return 0;
-    char line[LINE_BYTES];
-    const time_t now = time(nullptr);
-    tm local = {};
-    localtime_r(&now, &local);
-    int used = snprintf(line, sizeof line, "<%d>", log->facility | level);
-    used +=
-        static_cast<int>(strftime(line + used, sizeof line - static_cast<size_t>(used), "%h %e %T ", &local));
-    used += log->with_pid
-                ? snprintf(line + used, sizeof line - static_cast<size_t>(used), "%s[%d]: ", log->ident,
-                           static_cast<int>(getpid()))
-                : snprintf(line + used, sizeof line - static_cast<size_t>(used), "%s: ", log->ident);
-    const size_t head = static_cast<size_t>(used);
-    if (length > sizeof line - head - 1)
-        length = sizeof line - head - 1;
-    memcpy(line + head, text, length);
-    line[head + length] = '\0';
-    for (int attempt = 0; attempt < 2; attempt++) {
+static int send_line(syslog_socket *log, const char *line, size_t length) {
+    int result = ENOTCONN;
+    for (int failures = 0; failures < 2;) {
         if (log->fd < 0) {
-            const int result = connect_to_daemon(log);
+            result = connect_to_daemon(log);
+            if (result == EAGAIN && wait_for_room(log))
+                continue; // a stream whose daemon has yet to accept
             if (result != 0)
                 return result;
         }
-        const int result = send_line(log, line, head + length + (log->stream ? 1 : 0));
-        if (result == 0 || result == EAGAIN)
+        result = send_whole(log, line, length + (log->stream ? 1 : 0));
+        if (result == 0) {
+            log->patience_ns = SYSLOG_PATIENCE_NS;
+            return 0;
+        }
+        if (result == EAGAIN && !path_is_anothers(log))
             return result;
         syslog_socket_close(log); // the daemon has gone; perhaps another stands in its place
+        failures++;
     }
-    return ENOTCONN;
+    return result;
+}
+
+// The C library's head of a line.
+static size_t write_head(const syslog_socket *log, int32_t level, char *line, size_t size) {
+    static const char months[][4] = {"Jan", "Feb", "Mar", "Apr", "May", "Jun",
+                                     "Jul", "Aug", "Sep", "Oct", "Nov", "Dec"};
+    const time_t now = time(nullptr);
+    tm local = {};
+    localtime_r(&now, &local);
+    char process[16] = "";
+    if (log->with_pid)
+        snprintf(process, sizeof process, "[%d]", static_cast<int>(getpid()));
+    return static_cast<size_t>(snprintf(line, size, "<%d>%s %2d %02d:%02d:%02d %s%s: ", log->facility | level,
+                                        months[local.tm_mon], local.tm_mday, local.tm_hour, local.tm_min,
+                                        local.tm_sec, log->ident, process));
+}
+
+int syslog_socket_vsend(syslog_socket *log, int32_t level, const char *format, va_list arguments) {
+    static char line[LINE_BYTES];
+    const int saved_errno = errno;
+    if (!((1 << (level & LOG_PRIMASK)) & mask))
+        return 0;
+    const size_t head = write_head(log, level & LOG_PRIMASK, line, sizeof line);
+    va_list again;
+    va_copy(again, arguments);
+    errno = saved_errno;
+    const int text = vsnprintf(line + head, sizeof line - head, format, arguments);
+    const size_t length = text < 0 ? head : head + static_cast<size_t>(text);
+    int result = 0;
+    char *longer = nullptr;
+    if (length >= sizeof line && (longer = static_cast<char *>(malloc(length + 1)))) {
+        memcpy(longer, line, head);
+        errno = saved_errno;
+        vsnprintf(longer + head, length + 1 - head, format, again);
+        result = send_line(log, longer, length);
+        free(longer);
+    } else {
+        result = send_line(log, line, length < sizeof line ? length : sizeof line - 1);
+    }
+    va_end(again);
+    return result;
+}
+
+int syslog_socket_send(syslog_socket *log, int32_t level, const char *format, ...) {
+    va_list arguments;
+    va_start(arguments, format);
+    const int result = syslog_socket_vsend(log, level, format, arguments);
+    va_end(arguments);
+    return result;
 }

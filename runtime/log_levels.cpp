@@ -1,0 +1,320 @@
+// What decides whether a line is written and which facility it carries.
+//
+// Three sources decide the level: the system level (from a link in the file system, later from management),
+// an override level that counts while both its switches are on, and ahead of them the level of this process.
+// The first two make G_log_level; the last is G_daemon_log_level, which the level test prefers. The mask of
+// the log daemon's socket follows whichever counts. A process that logs to a console keeps its level.
+//
+// These operations run on the main thread, any of the others may be logging: the record is changed under its
+// lock, and what can log is done before the lock is taken.
+#include "runtime/log_state.h"
+
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include "runtime/guards.h"
+
+constexpr const char *LEVEL_LINK = "/var/opt/rvl/output/sysloglevel";
+constexpr const char *TIME_ZONE_FILE = "/var/opt/rvl/output/localtime";
+constexpr const char *FACILITY_FILE = "/var/opt/rvl/syslog_fac.conf";
+constexpr const char *DEBUG_LOG = "/var/log/debug_log";
+constexpr off_t DEBUG_LOG_MAX_BYTES = 2000000;
+constexpr int32_t DEFAULT_FACILITY = LOG_LOCAL1;
+
+std::atomic<int32_t> G_log_level{LC_LOG_NOTICE};
+std::atomic<int8_t> G_daemon_log_level{-1};
+lc_status (*lc_log_facility_from_session)(mdc *session, uint32_t *out_facility);
+
+const lc_enum_entry lc_log_level_table[] = {
+    {0, "emerg"},  {1, "alert"}, {2, "crit"},  {3, "err"},   {4, "warning"},
+    {5, "notice"}, {6, "info"},  {7, "debug"}, {0, nullptr},
+};
+const lc_enum_entry lc_log_level_upper_table[] = {
+    {0, "EMERG"},  {1, "ALERT"}, {2, "CRIT"},  {3, "ERR"},   {4, "WARNING"},
+    {5, "NOTICE"}, {6, "INFO"},  {7, "DEBUG"}, {0, nullptr},
+};
+const lc_enum_entry lc_log_component_table[] = {
+    {5, "mgmtd"}, {9, "libs"}, {11, "unk"}, {257, "tunneld"}, {262, "wccpd"}, {0, nullptr},
+};
+const lc_enum_entry lc_log_facility_table[] = {
+    {0, "kern"},     {8, "user"},     {16, "mail"},    {24, "daemon"},  {32, "auth"},     {40, "syslog"},
+    {48, "lpr"},     {56, "news"},    {64, "uucp"},    {72, "cron"},    {80, "authpriv"}, {88, "ftp"},
+    {128, "local0"}, {136, "local1"}, {144, "local2"}, {152, "local3"}, {160, "local4"},  {168, "local5"},
+    {176, "local6"}, {184, "local7"}, {0, nullptr},
+};
+
+bool log_is_managed(const char *process_name) {
+    static const char *const managed[] = {"wccpd", "tunneld", "mgmtd"};
+    for (const char *known : managed)
+        if (strcmp(known, process_name) == 0)
+            return true;
+    return false;
+}
+
+// --- The level link
+
+// The link's target is a decimal level. False when there is no link, or one that says something else.
+static bool read_level_link(int32_t *out_level) {
+    char target[16];
+    const ssize_t length = readlink(LEVEL_LINK, target, sizeof target - 1);
+    if (length <= 0)
+        return false;
+    target[length] = '\0';
+    char *end = nullptr;
+    const long level = strtol(target, &end, 10);
+    if (*end != '\0' || level < LC_LOG_EMERG || level > LC_LOG_DEBUG)
+        return false;
+    *out_level = static_cast<int32_t>(level);
+    return true;
+}
+
+void log_take_system_level(lc_log_state *state) {
+    int32_t level = LC_LOG_NOTICE;
+    (void)read_level_link(&level);
+    syslog_set_mask(level);
+    state->system_level = static_cast<int8_t>(level);
+}
+
+static timespec changed_at(const char *path, int (*look)(const char *, struct stat *)) {
+    struct stat status = {};
+    return look(path, &status) == 0 ? status.st_mtim : timespec{};
+}
+static bool same_time(const timespec &a, const timespec &b) {
+    return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec;
+}
+timespec log_level_link_time() {
+    return changed_at(LEVEL_LINK, lstat);
+}
+timespec log_time_zone_time() {
+    return changed_at(TIME_ZONE_FILE, stat);
+}
+
+static bool has_console(const lc_log_state *state) {
+    return state->time_header != 0;
+}
+static bool overridden(const lc_log_state *state) {
+    return state->system_override && state->class_override;
+}
+
+static void make_current(lc_log_state *state, uint8_t level) {
+    state->current_level = level;
+    const int32_t own = G_daemon_log_level;
+    syslog_set_mask(own != -1 ? own : level);
+    G_log_level = level;
+}
+
+void log_poll_level_link(lc_log_state *state, time_t now) {
+    if (!state->polls_level_link || state->level_link_looked == now)
+        return;
+    state->level_link_looked = now;
+    const timespec changed = log_level_link_time();
+    if (changed.tv_sec != 0 && !same_time(changed, state->level_link_changed)) {
+        log_take_system_level(state);
+        make_current(state,
+                     overridden(state) ? state->override_level : static_cast<uint8_t>(state->system_level));
+    }
+    state->level_link_changed = changed;
+}
+
+bool log_poll_time_zone(lc_log_state *state, time_t now) {
+    if (!state->polls_time_zone || state->time_zone_looked == now)
+        return false;
+    state->time_zone_looked = now;
+    const timespec changed = log_time_zone_time();
+    const bool differs = !same_time(changed, state->time_zone_changed);
+    state->time_zone_changed = changed;
+    return differs;
+}
+
+// --- Levels as management sets them
+
+// The log state under its lock, null before lc_log_init and after lc_log_close.
+struct locked_state {
+    locked_state() : guard(G_log_state_lock), state(G_log_state_lock ? G_log_state : nullptr) {}
+    const cancel_off_guard uncancelled;
+    const lc_lock_guard guard;
+    lc_log_state *const state;
+};
+
+static lc_status set_system_level(int32_t level) {
+    const locked_state log;
+    if (!log.state)
+        return LC_NULL;
+    if (has_console(log.state))
+        return LC_OK;
+    log.state->system_level = static_cast<int8_t>(level);
+    if (!overridden(log.state))
+        make_current(log.state, static_cast<uint8_t>(level));
+    return LC_OK;
+}
+
+lc_status lc_log_set_max_log_level(const char *name) {
+    int32_t level = 0;
+    CHECK_QUIET(lc_string_to_enum(lc_log_level_table, name, &level));
+    CHECK_STATUS(set_system_level(level));
+    return LC_OK;
+}
+
+lc_status lc_log_get_max_log_level(int32_t *out_level) {
+    CHECK_NULL(out_level);
+    *out_level = G_log_level;
+    return LC_OK;
+}
+
+lc_status lc_log_set_daemon_log_level(int32_t level) {
+    CHECK_CONDITION(level >= -1 && level <= LC_LOG_DEBUG);
+    G_daemon_log_level = static_cast<int8_t>(level);
+    syslog_set_mask(level == -1 ? G_log_level.load() : level);
+    return LC_OK;
+}
+
+int32_t lc_log_get_daemon_log_level() {
+    return G_daemon_log_level;
+}
+
+const char *lc_log_get_lls_process_name() {
+    return G_log_state ? G_log_state->process_name : "";
+}
+
+lc_status lc_log_get_syslog_facility(int32_t *out_facility) {
+    CHECK_NULL(out_facility);
+    *out_facility = 0;
+    CHECK_NULL(G_log_state);
+    *out_facility = G_log_state->facility;
+    return LC_OK;
+}
+
+static void settle_overrides(lc_log_state *state, bool overrides) {
+    if (!has_console(state))
+        make_current(state, overrides ? state->override_level : static_cast<uint8_t>(state->system_level));
+}
+
+static lc_status switch_override(int32_t system_wide, int32_t enable) {
+    const locked_state log;
+    if (!log.state)
+        return LC_NULL;
+    (system_wide ? log.state->system_override : log.state->class_override) = enable;
+    settle_overrides(log.state, overridden(log.state));
+    if (!system_wide && !enable)
+        log.state->override_level = log.state->current_level;
+    return LC_OK;
+}
+
+lc_status lc_log_enable_override_log_level(int32_t system_wide, int32_t enable) {
+    CHECK_STATUS(switch_override(system_wide, enable));
+    return LC_OK;
+}
+
+// A level of -1 stands for the system level. An override that ends so no longer counts.
+static lc_status set_override_level(int32_t level) {
+    const locked_state log;
+    if (!log.state)
+        return LC_NULL;
+    const bool counted = overridden(log.state);
+    log.state->override_level = static_cast<uint8_t>(level == -1 ? log.state->system_level : level);
+    if (level == -1)
+        log.state->class_override = 0;
+    if (counted)
+        settle_overrides(log.state, overridden(log.state));
+    return LC_OK;
+}
+
+lc_status lc_log_set_override_log_level(const char *name) {
+    CHECK_NULL(name);
+    int32_t level = 0;
+    if (lc_string_to_enum(lc_log_level_table, name, &level) != LC_OK)
+        level = -1;
+    CHECK_STATUS(set_override_level(level));
+    return LC_OK;
+}
+
+// --- Threads
+
+static lc_status name_thread(uint64_t native_id, uint32_t logged_id) {
+    const locked_state log;
+    if (!log.state)
+        return LC_NULL;
+    uint32_t place = 0;
+    while (place < log.state->thread_count && log.state->threads[place].native_id < native_id)
+        place++;
+    if (place == log.state->thread_count || log.state->threads[place].native_id != native_id) {
+        const size_t bytes = (log.state->thread_count + size_t{1}) * sizeof(lc_log_thread);
+        auto *larger = static_cast<lc_log_thread *>(realloc(log.state->threads, bytes));
+        if (!larger)
+            return LC_NULL;
+        log.state->threads = larger;
+        memmove(larger + place + 1, larger + place,
+                (log.state->thread_count - place) * sizeof(lc_log_thread));
+        log.state->thread_count++;
+    }
+    log.state->threads[place] = {native_id, logged_id};
+    return LC_OK;
+}
+
+lc_status lc_log_set_thread_id(uint32_t logged_id) {
+    CHECK_STATUS(name_thread(static_cast<uint64_t>(syscall(SYS_gettid)), logged_id));
+    return LC_OK;
+}
+
+// --- Facility
+
+static void facility_from_file(const char *process_name, int32_t *facility) {
+    FILE *file = fopen(FACILITY_FILE, "re");
+    if (!file)
+        return;
+    char line[256];
+    while (fgets(line, sizeof line, file)) {
+        char word[256];
+        unsigned number = 0;
+        if (line[0] == '#' || sscanf(line, "%255s %u", word, &number) != 2)
+            continue;
+        if (strcmp(word, "system") == 0) {
+            *facility = static_cast<int32_t>(number);
+            break;
+        }
+        (void)lc_log_file(nullptr, "Skipping facility type: %s for %s", word, process_name);
+    }
+    fclose(file);
+}
+
+int32_t lc_log_get_facility(mdc *session, const char *process_name) {
+    const cancel_off_guard uncancelled;
+    int32_t facility = DEFAULT_FACILITY;
+    if (!process_name || !log_is_managed(process_name))
+        return facility;
+    uint32_t from_session = 0;
+    if (!session)
+        facility_from_file(process_name, &facility);
+    else if (lc_log_facility_from_session && lc_log_facility_from_session(session, &from_session) == LC_OK)
+        facility = static_cast<int32_t>(from_session);
+    return facility;
+}
+
+int lc_log_file(const char *path, const char *format, ...) {
+    const cancel_off_guard uncancelled;
+    struct stat status = {};
+    const bool small = stat(DEBUG_LOG, &status) != 0 || status.st_size <= DEBUG_LOG_MAX_BYTES;
+    FILE *file = fopen(path ? path : DEBUG_LOG, small ? "ae" : "we");
+    if (!file)
+        return 1;
+    const time_t now = time(nullptr);
+    tm local = {};
+    localtime_r(&now, &local);
+    char stamp[32];
+    strftime(stamp, sizeof stamp, "%m%d%y %d%H%M", &local);
+    fprintf(file, "%s ", stamp);
+    va_list arguments;
+    va_start(arguments, format);
+    vfprintf(file, format, arguments);
+    va_end(arguments);
+    fputc('\n', file);
+    fclose(file);
+    return 0;
+}
