@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 #include <pthread.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -49,6 +50,29 @@ struct Mailbox : testing::Test {
 };
 
 } // namespace
+
+#ifndef WCCP_SANITIZED
+// Before any thread has run: the room that one leaves behind would do for the table.
+TEST_F(Mailbox, WithoutMemoryAMembershipIsRefusedAndTheRestStays) {
+    const uint8_t id = 9;
+    rlimit before;
+    getrlimit(RLIMIT_AS, &before);
+    const rlimit none = {1, before.rlim_max};
+    setrlimit(RLIMIT_AS, &none);
+    uint32_t refused = 1;
+    while (refused < WCCP_POLICY_GROUPS && wccp_add_policy_grp(static_cast<uint16_t>(refused), 1, &id) == 0)
+        refused++;
+    setrlimit(RLIMIT_AS, &before);
+    ASSERT_LT(refused, WCCP_POLICY_GROUPS);
+    EXPECT_EQ(wccp_get_role(static_cast<uint16_t>(refused)), 2u);
+    for (uint32_t policy = 1; policy <= refused; policy++)
+        ASSERT_EQ(wccp_check_policy_group(static_cast<uint16_t>(policy), id), policy < refused);
+    wccp_set_role(id, 0);
+    EXPECT_EQ(wccp_get_role(static_cast<uint16_t>(refused - 1)), 0u)
+        << "it still follows the last that took it";
+    EXPECT_EQ(wccp_add_policy_grp(static_cast<uint16_t>(refused), 1, &id), 0) << "with memory again";
+}
+#endif
 
 TEST_F(Mailbox, AResetLeavesEveryRoleUnknown) {
     wccp_mailbox->policy_roles[65535].role = 0;
