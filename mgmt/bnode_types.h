@@ -58,13 +58,11 @@ enum : uint32_t {
 };
 constexpr uint32_t BN_TYPE_LAST = 134;
 constexpr uint32_t BN_TYPE_MASK = 0xffff;
-enum : uint32_t {
-    bn_flag_display = 0x10000, // durations: the duration text instead of a plain number
-    bn_flag_invalid = 0x40000, // the text that was to become the value did not convert
-    bn_flag_deleted = 0x80000, // the node was deleted
-    bn_flag_absent = 0x100000, // names a type and holds no value
-    bn_flag_no_value = bn_flag_invalid | bn_flag_absent,
-};
+constexpr uint32_t bn_flag_display = 0x10000; // durations: the duration text instead of a plain number
+constexpr uint32_t bn_flag_invalid = 0x40000; // the text that was to become the value did not convert
+constexpr uint32_t bn_flag_deleted = 0x80000; // the node was deleted
+constexpr uint32_t bn_flag_absent = 0x100000; // names a type and holds no value
+constexpr uint32_t bn_flag_no_value = bn_flag_invalid | bn_flag_absent;
 
 // Attribute ids, stable on the wire; also places in a bn_attrib_array.
 enum : uint32_t {

@@ -1,0 +1,676 @@
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "mgmt/bnode.h"
+#include "tests/support/log_lines.cpp" // this program is linked without the engine's helpers
+#include "tests/support/owners.h"
+
+using attrib_owner = owner<bn_attrib, bn_attrib_free>;
+using binding_owner = owner<bn_binding, bn_binding_free>;
+using bindings_owner = owner<bn_binding_array, bn_binding_array_free>;
+using parts_owner = owner<tstr_array, tstr_array_free>;
+using string_owner = owner<tstring, ts_free>;
+using buffer_owner = owner<tbuffer, tb_free>;
+
+static std::string text(const tstring *string) {
+    return string ? std::string(string->buffer, static_cast<size_t>(string->length)) : "(null)";
+}
+
+// ---- Text
+
+struct text_case {
+    uint32_t type;
+    const char *in;
+    const char *out; // null: the same
+};
+static const text_case good_texts[] = {
+    {bn_type_uint8, "255", nullptr},
+    {bn_type_uint8, "007", "7"},
+    {bn_type_int8, "-128", nullptr},
+    {bn_type_uint16, "65535", nullptr},
+    {bn_type_int16, "-32768", nullptr},
+    {bn_type_uint32, "4294967295", nullptr},
+    {bn_type_int32, "-2147483648", nullptr},
+    {bn_type_uint64, "18446744073709551615", nullptr},
+    {bn_type_int64, "-9223372036854775808", nullptr},
+    {bn_type_int64, "9223372036854775807", nullptr},
+    {bn_type_bool, "on", "true"},
+    {bn_type_bool, "F", "false"},
+    {bn_type_float32, "1.5", "1.500000000"},
+    {bn_type_float64, "-0.25", nullptr},
+    {bn_type_char, "x", nullptr},
+    {bn_type_ipaddr, "10.0.0.1", nullptr},
+    {bn_type_ipaddr, "fe80::1", nullptr},
+    {bn_type_ipprefix, "10.0.0.0/8", nullptr},
+    {bn_type_ipprefix, "::1", "::1/0"},
+    {bn_type_ipv4addr, "192.168.1.255", nullptr},
+    {bn_type_ipv4prefix, "10.1.0.0/16", nullptr},
+    {bn_type_ipv4prefix, "0.0.0.0/0", nullptr},
+    {bn_type_ipv4prefix, "1.2.3.4/32", nullptr},
+    {bn_type_macaddr802, "AA:BB:CC:DD:EE:FF", nullptr},
+    {bn_type_macaddr802, "0011:2233:4455", "00:11:22:33:44:55"},
+    {bn_type_macaddr802, "1:2:a:b:c:d", "01:02:0A:0B:0C:0D"},
+    {bn_type_ipv6addr, "2001:db8::5", nullptr},
+    {bn_type_ipv6prefix, "2001:db8::/32", nullptr},
+    {bn_type_date, "2020/01/02", nullptr},
+    {bn_type_time_sec, "12:00:01", nullptr},
+    {bn_type_time_ms, "12:00:01.250", nullptr},
+    {bn_type_time_us, "12:00:01.250125", nullptr},
+    {bn_type_datetime_sec, "2020/01/02 03:04:05", nullptr},
+    {bn_type_datetime_ms, "2020/01/02 03:04:05.5", "2020/01/02 03:04:05.500"},
+    {bn_type_datetime_us, "2020/01/02 03:04:05.000001", nullptr},
+    {bn_type_duration_sec, "4294967295", nullptr},
+    {bn_type_duration_ms, "-5", nullptr},
+    {bn_type_duration_us, "1500000", nullptr},
+    {bn_type_duration_sec | bn_flag_display, "3.9", "3.000000 seconds"},
+    {bn_type_duration_us | bn_flag_display, "1.5 seconds", "1.500000 seconds"},
+    {bn_type_btype, "ipv4prefix", nullptr},
+    {bn_type_attribute, "revision_id", nullptr},
+    {bn_type_none, "anything", ""},
+    {bn_type_str, "", nullptr},
+    {bn_type_str, "any \xff text", nullptr},
+    {bn_type_utf8_string, "\xc3\xa4", nullptr},
+    {bn_type_binary, "bytes", nullptr},
+    {bn_type_hostname, "a-1.example", nullptr},
+    {bn_type_globpattern, "*", nullptr},
+};
+static const text_case bad_texts[] = {
+    {bn_type_uint8, "256", nullptr},
+    {bn_type_uint8, "-1", nullptr},
+    {bn_type_uint8, "+1", nullptr},
+    {bn_type_uint8, " 1", nullptr},
+    {bn_type_uint8, "1 ", nullptr},
+    {bn_type_uint8, "0x1", nullptr},
+    {bn_type_int8, "", nullptr},
+    {bn_type_int8, "128", nullptr},
+    {bn_type_int8, "-129", nullptr},
+    {bn_type_int8, "--1", nullptr},
+    {bn_type_int8, "- 1", nullptr},
+    {bn_type_uint32, "12x", nullptr},
+    {bn_type_uint32, "4294967296", nullptr},
+    {bn_type_uint64, "18446744073709551616", nullptr},
+    {bn_type_uint64, "-1", nullptr},
+    {bn_type_int64, "9223372036854775808", nullptr},
+    {bn_type_bool, "1", nullptr},
+    {bn_type_bool, "True", nullptr},
+    {bn_type_float32, "1e99", nullptr},
+    {bn_type_float64, "1.5x", nullptr},
+    {bn_type_float64, " 1", nullptr},
+    {bn_type_char, "xy", nullptr},
+    {bn_type_ipaddr, "10.0.0", nullptr},
+    {bn_type_ipaddr, "1:2", nullptr},
+    {bn_type_ipprefix, "10.0.0.0/33", nullptr},
+    {bn_type_ipprefix, "10.0.0.0/", nullptr},
+    {bn_type_ipv4addr, "1.2.3.256", nullptr},
+    {bn_type_ipv4addr, "1.2.3.4.5", nullptr},
+    {bn_type_ipv4addr, "1.2.3.-4", nullptr},
+    {bn_type_ipv4addr, "1..3.4", nullptr},
+    {bn_type_ipv4prefix, "1.2.3.4", nullptr},
+    {bn_type_ipv4prefix, "1.2.3.4/33", nullptr},
+    {bn_type_ipv4prefix, "1.2.3.4/-1", nullptr},
+    {bn_type_macaddr802, "00:11:22:33:44", nullptr},
+    {bn_type_macaddr802, "00:11:22:33:44:55:66", nullptr},
+    {bn_type_macaddr802, "00:11:22:33:44:", nullptr},
+    {bn_type_macaddr802, "00112:233:4455", nullptr},
+    {bn_type_ipv6addr, "10.0.0.1", nullptr},
+    {bn_type_ipv6prefix, "::1", nullptr},
+    {bn_type_ipv6prefix, "::1/129", nullptr},
+    {bn_type_date, "2020/1/2x", nullptr},
+    {bn_type_time_sec, "25:00:00", nullptr},
+    {bn_type_datetime_sec, "2100/01/01 00:00:00", nullptr}, // behind the last second
+    {bn_type_datetime_ms, "1960/01/01 00:00:00", nullptr},
+    {bn_type_duration_sec, "-1", nullptr},
+    {bn_type_duration_sec, "1.5", nullptr},
+    {bn_type_duration_sec | bn_flag_display, "-1", nullptr},
+    {bn_type_duration_ms | bn_flag_display, "soon", nullptr},
+    {bn_type_btype, "uint128", nullptr},
+    {bn_type_attribute, "", nullptr},
+    {bn_type_utf8_string, "\xc3", nullptr},
+    {bn_type_hostname, "-a", nullptr},
+    {bn_type_hostname, "a_b", nullptr},
+};
+
+TEST(Texts, BecomeValuesAndTextsAgain) {
+    for (const text_case &c : good_texts) {
+        attrib_owner attrib;
+        ASSERT_EQ(bn_attrib_new_str(&attrib, 1, c.type & BN_TYPE_MASK, c.type & ~BN_TYPE_MASK, c.in), LC_OK)
+            << c.type << c.in;
+        EXPECT_EQ(text_of([&](char **out) {
+                      return bn_attrib_get_str(attrib, nullptr, c.type & BN_TYPE_MASK, nullptr, out);
+                  }),
+                  c.out ? c.out : c.in)
+            << c.type;
+    }
+}
+TEST(Texts, BadOnesAreRefusedAndNothingIsLogged) {
+    log_lines log;
+    for (const text_case &c : bad_texts) {
+        if (c.type == bn_type_utf8_string)
+            continue; // tells its bytes
+        attrib_owner attrib;
+        ASSERT_EQ(bn_attrib_new_uint32(&attrib, 1, 0, 77), LC_OK);
+        EXPECT_EQ(bn_attrib_set_str(attrib, 1, c.type & BN_TYPE_MASK, c.type & ~BN_TYPE_MASK, c.in),
+                  LC_BAD_TYPE)
+            << c.type << " " << c.in;
+        uint32_t kept = 0; // the old value is still there
+        EXPECT_EQ(bn_attrib_get_uint32(attrib, nullptr, nullptr, &kept), LC_OK);
+        EXPECT_EQ(kept, 77u);
+    }
+    EXPECT_EQ(log.take(), "");
+    for (const text_case &c : bad_texts) {
+        binding_owner binding;
+        uint32_t type = 0;
+        EXPECT_EQ(bn_binding_new_str_autoinval(&binding, "/a", 1, c.type & BN_TYPE_MASK,
+                                               c.type & ~BN_TYPE_MASK, c.in),
+                  LC_OK)
+            << c.type << " " << c.in;
+        EXPECT_EQ(text_of([&](char **out) { return bn_binding_get_str(binding, 1, 0, &type, out); }), "");
+        EXPECT_EQ(type, c.type | bn_flag_invalid);
+    }
+}
+TEST(Texts, RefusedTypesAndIds) {
+    attrib_owner attrib;
+    EXPECT_EQ(bn_attrib_new_str(&attrib, 1, bn_type_any, 0, "x"), LC_UNEXPECTED_CASE);
+    EXPECT_EQ(attrib.pointer, nullptr);
+    EXPECT_EQ(bn_attrib_new_str(&attrib, 1, 30, 0, "x"), LC_ASSERTION);
+    EXPECT_EQ(bn_attrib_new_str(&attrib, 1, bn_type_uint8, 0, nullptr), LC_NULL);
+    for (const uint32_t id : {0u, 4u, 131u, 0xffffffffu})
+        EXPECT_EQ(bn_attrib_new_uint32(&attrib, id, 0, 1), LC_ASSERTION) << id;
+    EXPECT_EQ(bn_attrib_new_macaddr802(&attrib, 1, 0, nullptr), LC_NULL);
+    EXPECT_EQ(bn_attrib_set_uint32(nullptr, 1, 0, 1), LC_NULL);
+
+    binding_owner invalid, absent;
+    ASSERT_EQ(bn_binding_new_str_autoinval(&invalid, "/a", 1, bn_type_uint32, 0, "abc"), LC_OK);
+    const bn_attrib *given = nullptr;
+    ASSERT_EQ(bn_binding_get_attrib(invalid, 1, &given), LC_OK);
+    EXPECT_EQ(given->value_size, 4u);
+    EXPECT_EQ(given->type_flags, static_cast<uint32_t>(bn_flag_invalid));
+    ASSERT_EQ(bn_binding_new_str(&absent, "/a", 1, bn_type_str, bn_flag_deleted | bn_flag_absent, nullptr),
+              LC_OK);
+    uint32_t type = 0, flags = 0;
+    EXPECT_EQ(bn_binding_get_type(absent, 1, &type, &flags), LC_OK);
+    EXPECT_EQ(type, static_cast<uint32_t>(bn_type_str));
+    EXPECT_EQ(flags, 0x180000u);
+    EXPECT_FALSE(bn_type_string(type | flags));
+    EXPECT_TRUE(bn_type_string(type));
+    string_owner value;
+    EXPECT_EQ(bn_binding_get_tstr(absent, 1, 0, nullptr, &value), LC_OK);
+    EXPECT_EQ(text(value), "");
+}
+
+// ---- Wire: bytes written by hand
+
+struct wire_case {
+    const char *what;
+    uint32_t type;
+    const char *in;
+    const char *bytes;
+};
+static const wire_case wire_cases[] = {
+    {"uint8", bn_type_uint8, "7", "00000001 00000001 00000001 00000000 00000001 07"},
+    {"int16", bn_type_int16, "-2", "00000001 00000001 00000004 00000000 00000002 fffe"},
+    {"uint32", bn_type_uint32, "258", "00000001 00000001 00000005 00000000 00000004 00000102"},
+    {"uint64", bn_type_uint64, "72623859790382856",
+     "00000001 00000001 00000007 00000000 00000008 0102030405060708"},
+    {"bool", bn_type_bool, "true", "00000001 00000001 00000009 00000000 00000004 00000001"},
+    {"float32", bn_type_float32, "1.5", "00000001 00000001 00000014 00000000 00000004 3fc00000"},
+    {"float64", bn_type_float64, "1.5", "00000001 00000001 00000015 00000000 00000008 3ff8000000000000"},
+    {"char", bn_type_char, "A", "00000001 00000001 00000028 00000000 00000001 41"},
+    {"ipv4addr", bn_type_ipv4addr, "10.1.2.3", "00000001 00000001 0000003c 00000000 00000004 0a010203"},
+    {"ipv4prefix", bn_type_ipv4prefix, "10.1.0.0/16",
+     "00000001 00000001 0000003d 00000000 00000008 0a010000 ffff0000"},
+    {"ipv6addr, turned around", bn_type_ipv6addr, "2001:db8::5",
+     "00000001 00000001 0000003f 00000000 00000010 05000000000000000000 0000 b80d0120"},
+    {"ipv6prefix", bn_type_ipv6prefix, "2001:db8::/32",
+     "00000001 00000001 00000040 00000000 00000011 000000000000000000000000 b80d0120 20"},
+    {"macaddr802", bn_type_macaddr802, "00:11:22:33:44:55",
+     "00000002 00000001 0000003e 00000000 00000006 001122334455"},
+    {"date", bn_type_date, "1970/01/02", "00000001 00000001 00000046 00000000 00000004 00015180"},
+    {"duration_ms, displayed", bn_type_duration_ms | bn_flag_display, "1.5",
+     "00000001 00000001 0000004e 00010000 00000008 00000000000005dc"},
+    {"none", bn_type_none, "x", "00000001 00000001 0000005a 00000000 00000000"},
+    {"btype", bn_type_btype, "string", "00000001 00000001 0000005c 00000000 00000004 00000065"},
+    {"ipaddr of 4", bn_type_ipaddr, "10.1.2.3",
+     "00000001 00000001 00000032 00000000 04 000000000000000000000000 0302010a"},
+    {"ipaddr of 6", bn_type_ipaddr, "2001:db8::5",
+     "00000001 00000001 00000032 00000000 06 0500000000000000 00000000 b80d0120"},
+    {"ipprefix", bn_type_ipprefix, "10.1.0.0/16",
+     "00000001 00000001 00000033 00000000 04 10 000000000000000000000000 0000010a"},
+    {"string", bn_type_str, "abc", "00000004 00000001 00000065 00000000 00000003 616263"},
+    {"empty string", bn_type_str, "", "00000004 00000001 00000065 00000000 00000000"},
+    {"hostname", bn_type_hostname, "a.b", "00000004 00000001 00000082 00000000 00000003 612e62"},
+    {"binary", bn_type_binary, "xyz", "00000004 00000001 00000067 00000000 00000003 78797a"},
+    {"invalid uint32", bn_type_uint32 | bn_flag_invalid, "",
+     "00000001 00000001 00000005 00040000 00000004 00000000"},
+    {"absent uint32", bn_type_uint32 | bn_flag_absent | bn_flag_deleted, "",
+     "00000001 00000001 00000005 00180000 00000000"},
+    {"absent string", bn_type_str | bn_flag_absent, "", "00000004 00000001 00000065 00100000 00000000"},
+};
+static std::string from_hex(const char *hex) {
+    std::string bytes;
+    for (; *hex; hex++)
+        if (*hex != ' ') {
+            bytes += static_cast<char>(std::stoi(std::string(hex, 2), nullptr, 16));
+            hex++;
+        }
+    return bytes;
+}
+static std::string content(const tbuffer *buffer) {
+    return std::string(reinterpret_cast<char *>(tb_buf(buffer)), static_cast<size_t>(tb_length(buffer)));
+}
+
+TEST(Wire, EachFamilyByteForByte) {
+    for (const wire_case &c : wire_cases) {
+        attrib_owner attrib, back;
+        buffer_owner buffer;
+        const std::string golden = from_hex(c.bytes);
+        ASSERT_EQ(tb_new(&buffer), LC_OK);
+        ASSERT_EQ(tb_append_uint8(buffer, 0xee), LC_OK); // odd offsets
+        ASSERT_EQ(bn_attrib_new_str(&attrib, 1, c.type & BN_TYPE_MASK, c.type & ~BN_TYPE_MASK, c.in), LC_OK);
+        ASSERT_EQ(bn_attrib_append_wire(attrib, buffer), LC_OK) << c.what;
+        EXPECT_EQ(content(buffer).substr(1), golden) << c.what;
+
+        uint32_t used = 0;
+        ASSERT_EQ(bn_attrib_read_wire(buffer, 1, &back, &used), LC_OK) << c.what;
+        EXPECT_EQ(used, golden.size()) << c.what;
+        EXPECT_EQ(back->value_size, attrib->value_size) << c.what;
+        int order = 1;
+        ASSERT_EQ(bn_attrib_compare(attrib, back, &order), LC_OK);
+        EXPECT_EQ(order, 0) << c.what;
+        EXPECT_EQ(back->type | back->type_flags, c.type);
+    }
+}
+
+TEST(Wire, CutAnywhereItIsRefused) {
+    for (const wire_case &c : wire_cases) {
+        const std::string golden = from_hex(c.bytes);
+        for (size_t length = 0; length < golden.size(); length++) {
+            // Exactly the bytes that came, so that a read behind them is seen.
+            std::vector<uint8_t> bytes(golden.begin(), golden.begin() + static_cast<std::ptrdiff_t>(length));
+            if (bytes.empty())
+                continue;
+            buffer_owner buffer;
+            attrib_owner attrib;
+            uint32_t used = 0;
+            ASSERT_EQ(tb_new_buf_const(&buffer, bytes.data(), static_cast<uint32_t>(length)), LC_OK);
+            EXPECT_NE(bn_attrib_read_wire(buffer, 0, &attrib, &used), LC_OK) << c.what << length;
+            EXPECT_EQ(attrib.pointer, nullptr);
+        }
+    }
+}
+
+TEST(Wire, LyingFieldsAreRefused) {
+    struct lie {
+        const char *what;
+        const char *bytes;
+        lc_status status;
+    };
+    static const lie lies[] = {
+        {"id 2^32 - 1", "00000001 ffffffff 00000005 00000000 00000004 00000001", LC_ASSERTION},
+        {"id 0", "00000001 00000000 00000005 00000000 00000004 00000001", LC_ASSERTION},
+        {"id none", "00000001 00000004 00000005 00000000 00000004 00000001", LC_ASSERTION},
+        {"id 131", "00000001 00000083 00000005 00000000 00000004 00000001", LC_ASSERTION},
+        {"type 0", "00000001 00000001 00000000 00000000 00000004 00000001", LC_ASSERTION},
+        {"type 135", "00000001 00000001 00000087 00000000 00000004 00000001", LC_ASSERTION},
+        {"type 2^31", "00000001 00000001 80000005 00000000 00000004 00000001", LC_ASSERTION},
+        {"type any", "00000001 00000001 0000005b 00000000 00000004 00000001", LC_NULL},
+        {"a number that is no type", "00000001 00000001 0000000b 00000000 00000004 00000001", LC_NULL},
+        {"kind of another family", "00000004 00000001 00000005 00000000 00000004 00000001", LC_GENERIC},
+        {"size of another type", "00000001 00000001 00000005 00000000 00000002 00000001", LC_GENERIC},
+        {"size 0 of a value", "00000001 00000001 00000005 00000000 00000000 00000001", LC_GENERIC},
+        {"size 2^32 - 1", "00000001 00000001 00000005 00000000 ffffffff 00000001", LC_GENERIC},
+        {"length 2^32 - 1", "00000004 00000001 00000065 00000000 ffffffff 616263", LC_NO_BUFFER_SPACE},
+        {"length one too many", "00000004 00000001 00000067 00000000 00000004 616263", LC_NO_BUFFER_SPACE},
+    };
+    for (const lie &c : lies) {
+        const std::string bytes = from_hex(c.bytes);
+        buffer_owner buffer;
+        attrib_owner attrib;
+        ASSERT_EQ(tb_new_buf(&buffer, bytes.data(), static_cast<int32_t>(bytes.size())), LC_OK);
+        EXPECT_EQ(bn_attrib_read_wire(buffer, 0, &attrib, nullptr), c.status) << c.what;
+    }
+    log_lines log;
+    attrib_owner attrib;
+    buffer_owner buffer;
+    ASSERT_EQ(tb_new(&buffer), LC_OK);
+    ASSERT_EQ(bn_attrib_new(&attrib), LC_OK);
+    attrib->type = bn_type_any;
+    EXPECT_EQ(bn_attrib_append_wire(attrib, buffer), LC_NULL);
+    EXPECT_NE(log.take().find("Couldn't get attrib copy out func for type any"), std::string::npos);
+    attrib->type = 0;
+    EXPECT_EQ(bn_attrib_append_wire(attrib, buffer), LC_ASSERTION);
+    EXPECT_EQ(tb_length(buffer), 0);
+}
+
+TEST(Wire, TextThatIsNoUtf8StaysPlain) {
+    const std::string bytes = from_hex("00000004 00000001 00000066 00000000 00000002 61ff");
+    buffer_owner buffer;
+    attrib_owner attrib;
+    ASSERT_EQ(tb_new_buf(&buffer, bytes.data(), static_cast<int32_t>(bytes.size())), LC_OK);
+    ASSERT_EQ(bn_attrib_read_wire(buffer, 0, &attrib, nullptr), LC_OK);
+    EXPECT_EQ(text(attrib->value.string), "a\xff");
+    EXPECT_EQ(attrib->value.string->utf8, 0);
+}
+
+// ---- Attributes and bindings
+
+TEST(Attributes, Order) {
+    const auto order_of = [](uint32_t type, const char *a, const char *b) {
+        attrib_owner left, right;
+        int order = 99;
+        EXPECT_EQ(bn_attrib_new_str(&left, 1, type, 0, a), LC_OK);
+        EXPECT_EQ(bn_attrib_new_str(&right, 1, type, 0, b), LC_OK);
+        EXPECT_EQ(bn_attrib_compare(left, right, &order), LC_OK);
+        return (order > 0) - (order < 0);
+    };
+    EXPECT_EQ(order_of(bn_type_int32, "-1", "1"), -1);
+    EXPECT_EQ(order_of(bn_type_uint32, "4294967295", "1"), 1);
+    EXPECT_EQ(order_of(bn_type_uint64, "10", "9"), 1);
+    EXPECT_EQ(order_of(bn_type_float64, "-1.5", "0.5"), -1);
+    EXPECT_EQ(order_of(bn_type_str, "10", "9"), -1);
+    EXPECT_EQ(order_of(bn_type_binary, "ab", "abc"), -1);
+    EXPECT_EQ(order_of(bn_type_ipv4addr, "10.0.0.2", "9.9.9.9"), 1);
+    EXPECT_EQ(order_of(bn_type_ipaddr, "200.0.0.1", "::1"), -1);
+    EXPECT_EQ(order_of(bn_type_ipprefix, "10.0.0.0/8", "10.0.0.0/16"), -1);
+
+    attrib_owner number, invalid, string;
+    int order = 0;
+    ASSERT_EQ(bn_attrib_new_uint32(&number, 1, 0, 1), LC_OK);
+    ASSERT_EQ(bn_attrib_new_str(&invalid, 1, bn_type_uint8, bn_flag_invalid, ""), LC_OK);
+    ASSERT_EQ(bn_attrib_new_str(&string, 1, bn_type_str, 0, "x"), LC_OK);
+    EXPECT_EQ(bn_attrib_compare(number, invalid, &order), LC_OK);
+    EXPECT_LT(order, 0);
+    EXPECT_EQ(bn_attrib_compare(invalid, invalid, &order), LC_OK);
+    EXPECT_EQ(order, 0);
+    EXPECT_EQ(bn_attrib_compare(string, number, &order), LC_OK);
+    EXPECT_EQ(order, 96);
+    EXPECT_EQ(bn_attrib_compare(nullptr, number, &order), LC_OK);
+    EXPECT_GT(order, 0);
+    attrib_owner copy;
+    ASSERT_EQ(bn_attrib_dup(string, &copy), LC_OK);
+    EXPECT_NE(copy->value.string, string->value.string);
+    EXPECT_EQ(bn_attrib_compare(string, copy, &order), LC_OK);
+    EXPECT_EQ(order, 0);
+}
+
+TEST(Bindings, TypedOperations) {
+    binding_owner binding;
+    uint32_t type = 9, value = 42;
+    ASSERT_EQ(bn_binding_new_uint32(&binding, "/a", 1, bn_flag_display | 7, 5), LC_OK);
+    EXPECT_EQ(bn_binding_get_uint32(binding, 1, &type, &value), LC_OK);
+    EXPECT_EQ(value, 5u);
+    EXPECT_EQ(type, bn_type_uint32 | bn_flag_display);
+    value = 42;
+    EXPECT_EQ(bn_binding_get_uint32(binding, 0, &type, &value), LC_OK); // an empty slot
+    EXPECT_EQ(value, 42u);
+    EXPECT_EQ(type, 0u);
+    EXPECT_EQ(bn_binding_set_uint64(binding, 129, 0, 1ull << 40), LC_OK);
+    EXPECT_EQ(bn_binding_set_int8(binding, 1, 0, -1), LC_OK);
+    int8_t small = 0;
+    EXPECT_EQ(bn_binding_get_int8(binding, 1, nullptr, &small), LC_OK);
+    EXPECT_EQ(small, -1);
+    uint64_t first = 0, last = 0;
+    binding_owner address;
+    ASSERT_EQ(bn_binding_new_ipv6addr(&address, "/b", 1, 0, 1, 2), LC_OK);
+    EXPECT_EQ(bn_binding_get_ipv6addr(address, 1, nullptr, &first, &last), LC_OK);
+    EXPECT_EQ(first, 1u);
+    EXPECT_EQ(last, 2u);
+
+    log_lines log;
+    EXPECT_EQ(bn_binding_get_uint32(nullptr, 1, nullptr, &value), LC_NULL);
+    EXPECT_NE(log.take().find("NULL binding passed"), std::string::npos);
+    EXPECT_EQ(bn_binding_get_uint32(binding, 1, nullptr, &value), LC_ASSERTION);
+    EXPECT_NE(log.take().find("Tried to get a int8 attribute as a uint32"), std::string::npos);
+    EXPECT_EQ(bn_binding_get_uint32(address, 129, nullptr, &value), LC_NOT_FOUND);
+    EXPECT_NE(log.take().find("Error code 14004"), std::string::npos);
+    binding_owner bare;
+    ASSERT_EQ(bn_binding_new_named(&bare, "/c"), LC_OK);
+    EXPECT_EQ(bn_binding_get_uint32(bare, 1, nullptr, &value), LC_NULL);
+    EXPECT_EQ(bn_binding_get_type(bare, 1, &type, nullptr), LC_NULL);
+    EXPECT_NE(log.take().find("Unexpected NULL"), std::string::npos);
+    char *given = nullptr;
+    EXPECT_EQ(bn_binding_get_str(bare, 1, 0, nullptr, &given), LC_NULL);
+    EXPECT_NE(log.take().find("Can't get attribute value of binding /c"), std::string::npos);
+    EXPECT_EQ(bn_binding_get_str(address, 129, 0, nullptr, &given), LC_NOT_FOUND);
+    EXPECT_NE(log.take().find("Can't get attribute revision_id of binding /b"), std::string::npos);
+    EXPECT_EQ(bn_binding_get_str(address, 0, 0, nullptr, &given), LC_OK);
+    EXPECT_EQ(given, nullptr);
+    string_owner string;
+    EXPECT_EQ(bn_binding_get_tstr(binding, 1, 0, &type, &string), LC_OK);
+    EXPECT_EQ(text(string), "-1");
+    EXPECT_EQ(bn_binding_get_tstr(binding, 1, bn_type_str, nullptr, &string), LC_ASSERTION);
+    EXPECT_NE(log.take().find("Error code"), std::string::npos);
+}
+
+TEST(Bindings, NamesAndParts) {
+    struct name_case {
+        const char *name;
+        int absolute;
+        std::vector<const char *> parts;
+    };
+    const name_case cases[] = {
+        {"/a/b", 1, {"a", "b"}},
+        {"a/b", 0, {"a", "b"}},
+        {"a//b", 0, {"a", "", "b"}},
+        {"/a/", 1, {"a", ""}},
+        {"/", 1, {}},
+        {"", 0, {}},
+        {"a\\b", 0, {"a\\b"}},
+        {"/a\\/b/c", 1, {"a/b", "c"}},
+    };
+    for (const name_case &c : cases) {
+        parts_owner parts;
+        int absolute = -1;
+        ASSERT_EQ(bn_binding_name_to_parts(c.name, &parts, &absolute), LC_OK);
+        ASSERT_NE(parts.pointer, nullptr);
+        EXPECT_EQ(absolute, c.absolute) << c.name;
+        ASSERT_EQ(tstr_array_length_quick(parts), c.parts.size()) << c.name;
+        for (uint32_t i = 0; i < c.parts.size(); i++)
+            EXPECT_STREQ(tstr_array_get_str_quick(parts, i), c.parts[i]);
+        EXPECT_EQ(text_of([&](char **out) { return bn_binding_name_parts_to_name(parts, absolute, out); }),
+                  c.name);
+    }
+    const char *syslog = "/logging/syslog/action/file/\\/var\\/log\\/messages/facility/all/min_priority";
+    binding_owner binding, from_parts, copy;
+    parts_owner parts;
+    ASSERT_EQ(bn_binding_new_named(&binding, syslog), LC_OK);
+    ASSERT_EQ(bn_binding_get_name_parts(binding, &parts), LC_OK);
+    ASSERT_EQ(tstr_array_length_quick(parts), 8u);
+    EXPECT_STREQ(tstr_array_get_str_quick(parts, 4), "/var/log/messages");
+    ASSERT_EQ(bn_binding_new_parts_components(&from_parts, nullptr, parts, 1, nullptr), LC_OK);
+    EXPECT_STREQ(bn_binding_get_name_quick(from_parts), syslog);
+    const tstr_array *kept = nullptr;
+    ASSERT_EQ(bn_binding_dup(from_parts, &copy), LC_OK);
+    ASSERT_EQ(bn_binding_get_name_parts_const(copy, &kept, nullptr), LC_OK);
+    EXPECT_EQ(tstr_array_length_quick(kept), 8u);
+    ASSERT_EQ(bn_binding_set_name(copy, "relative"), LC_OK);
+    ASSERT_EQ(bn_binding_get_name_parts_const(copy, &kept, nullptr), LC_OK);
+    EXPECT_EQ(kept, nullptr);
+    EXPECT_EQ(bn_binding_get_name_parts(copy, &parts), LC_ASSERTION);
+}
+
+static const struct {
+    const char *pattern, *name;
+    bool matched;
+} pattern_cases[] = {
+    {"/qv/wccpd/wccp/srv_grp/config/*", "/qv/wccpd/wccp/srv_grp/config/51", true},
+    {"/qv/wccpd/wccp/srv_grp/config/*", "/qv/wccpd/wccp/srv_grp/config/51/weight", false},
+    {"/logging/**", "/logging/a", true},
+    {"/logging/**", "/logging/a/b/c", true},
+    {"/logging/**", "/logging", false},
+    {"/a/**/b", "/a/x/y", true},
+    {"/a/**/b", "/a/x", false},
+    {"/a/b", "/a/b", true},
+    {"a/b", "a/b", true},
+    {"/a/b", "a/b", false},
+    {"a/b", "/a/b", false},
+    {"/a/b", "/a/bc", false},
+    {"/a/bc", "/a/b", false},
+    {"/a/*/c", "/a/x\\/y/c", true},
+    {"/a\\/b/*", "/a\\/b/c", true},
+    {"/a/*", "/a/", true},
+    {"/", "/", true},
+    {"/", "/a", false},
+    {"/*", "/", false},
+    {"/a//b", "/a//b", true},
+    {"/a\\b", "/a\\b", true},
+};
+TEST(Bindings, PatternsMatchTextAsTheyMatchParts) {
+    for (const auto &c : pattern_cases) {
+        parts_owner parts;
+        int absolute = 0;
+        EXPECT_EQ(bn_binding_name_pattern_match(c.name, c.pattern), c.matched) << c.pattern << " " << c.name;
+        ASSERT_EQ(bn_binding_name_to_parts(c.name, &parts, &absolute), LC_OK);
+        EXPECT_EQ(bn_binding_name_parts_pattern_match(parts, absolute, c.pattern), c.matched)
+            << c.pattern << " " << c.name;
+    }
+}
+// Every short pattern against every short name: the walk over the text and the one over parts agree.
+TEST(Bindings, BothMatchersAgreeEverywhere) {
+    static const char *pieces[] = {"a", "*", "**", "\\/", "\\\\", "", "ab"};
+    std::vector<std::string> names = {"", "/"};
+    for (const char *lead : {"", "/"})
+        for (const char *one : pieces)
+            for (const char *two : pieces) {
+                names.push_back(std::string(lead) + one + "/" + two);
+                names.push_back(std::string(lead) + one + two);
+                names.push_back(std::string(lead) + one + "/" + two + "/a");
+            }
+    for (const std::string &name : names) {
+        parts_owner parts;
+        int absolute = 0;
+        ASSERT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, &absolute), LC_OK);
+        for (const std::string &pattern : names)
+            ASSERT_EQ(bn_binding_name_pattern_match(name.c_str(), pattern.c_str()),
+                      bn_binding_name_parts_pattern_match(parts, absolute, pattern.c_str()))
+                << "name " << name << " pattern " << pattern;
+    }
+}
+
+// ---- Arrays
+
+static void append(bn_binding_array *array, const std::string &name, uint32_t value) {
+    binding_owner binding;
+    ASSERT_EQ(bn_binding_new_uint32(&binding, name.c_str(), 1, 0, value), LC_OK);
+    ASSERT_EQ(bn_binding_array_append_takeover(array, &binding.pointer), LC_OK);
+    ASSERT_EQ(binding.pointer, nullptr);
+}
+static std::string parts_of(const bn_binding_array *array, const char *pattern, uint32_t part) {
+    parts_owner parts;
+    std::string all;
+    if (bn_binding_array_get_name_part_tstr_array(array, pattern, part, &parts) != LC_OK)
+        return "(failed)";
+    for (uint32_t i = 0; i < tstr_array_length_quick(parts); i++)
+        all += std::string(tstr_array_get_str_quick(parts, i)) + " ";
+    return all;
+}
+TEST(BindingArrays, FindByNameAndPattern) {
+    for (const bool sorted : {false, true}) {
+        bindings_owner array;
+        ASSERT_EQ(bn_binding_array_new(&array), LC_OK);
+        for (const char *name :
+             {"/c/2/router/1", "/c/1", "/c/1/router/3", "/c/1/router/1", "/c-x", "/c/1/router"})
+            append(array, name, 7);
+        if (sorted) {
+            ASSERT_EQ(bn_binding_array_sort(array), LC_OK);
+        }
+        int32_t index = 0;
+        EXPECT_EQ(bn_binding_array_get_index_by_name(array, "/none", &index), LC_OK);
+        EXPECT_EQ(index, -1);
+        const bn_binding *found = nullptr;
+        EXPECT_EQ(bn_binding_array_get_binding_by_name_rel(array, "/c/1", "router/1", &found), LC_OK);
+        ASSERT_NE(found, nullptr);
+        EXPECT_STREQ(bn_binding_get_name_quick(found), "/c/1/router/1");
+        string_owner value, name;
+        uint32_t type = 0;
+        EXPECT_EQ(bn_binding_array_get_value_tstr_by_name(array, "/c/1", &type, &value), LC_OK);
+        EXPECT_EQ(text(value), "7");
+        EXPECT_EQ(type, static_cast<uint32_t>(bn_type_uint32));
+        EXPECT_EQ(bn_binding_array_get_value_tstr_by_name_rel(array, "/c", "9", &type, &value), LC_OK);
+        EXPECT_EQ(value.pointer, nullptr);
+
+        EXPECT_EQ(parts_of(array, "/c/1/router/*", 3), sorted ? "1 3 " : "3 1 ");
+        EXPECT_EQ(parts_of(array, "/c/*/router/*", 1), sorted ? "1 1 2 " : "2 1 1 ");
+        EXPECT_EQ(parts_of(array, "/*", 0), "c-x ");
+        EXPECT_EQ(parts_of(array, "/x/*", 0), "");
+        EXPECT_EQ(parts_of(array, "/c/1", 2), "(failed)");
+        EXPECT_EQ(
+            bn_binding_array_get_first_matching_value_tstr(array, "/c/*/router/*", 0, &index, &name, &value),
+            LC_OK);
+        const auto first = static_cast<uint32_t>(index);
+        EXPECT_EQ(text(name), sorted ? "/c/1/router/1" : "/c/2/router/1");
+        EXPECT_EQ(
+            bn_binding_array_get_first_matching_binding(array, "/c/*/router/*", first + 1, &index, &found),
+            LC_OK);
+        EXPECT_STREQ(bn_binding_get_name_quick(found), "/c/1/router/3");
+        EXPECT_EQ(bn_binding_array_get_first_matching_binding(array, "/c/*/router/*", 99, &index, &found),
+                  LC_OK);
+        EXPECT_EQ(index, -1);
+        EXPECT_EQ(found, nullptr);
+
+        binding_owner detached;
+        EXPECT_EQ(bn_binding_array_detach_binding_by_name(array, "/c-x", &detached), LC_OK);
+        EXPECT_STREQ(bn_binding_get_name_quick(detached), "/c-x");
+        EXPECT_EQ(bn_binding_array_length_quick(array), 5u);
+        EXPECT_EQ(bn_binding_array_detach_binding_by_name(array, "/c-x", &detached), LC_OK);
+        EXPECT_EQ(detached.pointer, nullptr);
+    }
+    int32_t index = 0;
+    EXPECT_EQ(bn_binding_array_get_index_by_name(nullptr, "/a", &index), LC_NULL);
+}
+
+TEST(BindingArrays, RenamedBindingsAreFound) {
+    bindings_owner array;
+    ASSERT_EQ(bn_binding_array_new(&array), LC_OK);
+    for (int i = 40; i > 0; i--)
+        append(array, "/n/" + std::to_string(i), 0);
+    int32_t index = -1;
+    ASSERT_EQ(bn_binding_array_get_index_by_name(array, "/n/5", &index), LC_OK);
+    EXPECT_EQ(index, 35);
+    ASSERT_EQ(bn_binding_set_name(bn_binding_array_get_quick(array, 35), "/m"), LC_OK);
+    ASSERT_EQ(bn_binding_array_get_index_by_name(array, "/n/5", &index), LC_OK);
+    EXPECT_EQ(index, -1);
+    ASSERT_EQ(bn_binding_array_get_index_by_name(array, "/m", &index), LC_OK);
+    EXPECT_EQ(index, 35);
+    append(array, "/a", 0);
+    ASSERT_EQ(bn_binding_array_get_index_by_name(array, "/a", &index), LC_OK);
+    EXPECT_EQ(index, 40);
+}
+
+// A whole configuration: every name asked for once, and one pattern for each group. Measured against itself
+// at a quarter of the size, so that the machine doesn't matter: linear is four times, quadratic sixteen.
+static double seconds_for(uint32_t groups, bool sorted) {
+    bindings_owner array;
+    EXPECT_EQ(bn_binding_array_new(&array), LC_OK);
+    std::vector<std::string> names;
+    for (uint32_t i = 0; i < groups; i++)
+        for (uint32_t field = 0; field < 40; field++)
+            names.push_back("/qv/wccpd/wccp/srv_grp/config/" + std::to_string(groups - i) + "/field/" +
+                            std::to_string(field));
+    for (const std::string &name : names)
+        append(array, name, 1);
+    if (sorted) {
+        EXPECT_EQ(bn_binding_array_sort(array), LC_OK);
+    }
+    const auto start = std::chrono::steady_clock::now();
+    for (const std::string &name : names) {
+        const bn_binding *found = nullptr;
+        EXPECT_EQ(bn_binding_array_get_binding_by_name(array, name.c_str(), &found), LC_OK);
+        EXPECT_NE(found, nullptr);
+        EXPECT_EQ(bn_binding_array_get_binding_by_name_rel(array, name.c_str(), "x", &found), LC_OK);
+    }
+    return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+}
+TEST(BindingArrays, LookingUpAWholeConfigurationIsNotQuadratic) {
+    for (const bool sorted : {false, true}) {
+        double ratio = 99;
+        for (int attempt = 0; attempt < 5 && ratio > 9; attempt++)
+            ratio = std::min(ratio, seconds_for(256, sorted) / seconds_for(64, sorted));
+        EXPECT_LT(ratio, 9) << sorted;
+    }
+}
