@@ -39,8 +39,11 @@ bool wccp_attach_mailbox() {
     if (!block)
         return false;
     if (length < sizeof(wccp_tunnel_mailbox)) {
-        QV_LOG(LC_LOG_ERR, "Block %s has %lu bytes in place of %lu and is not used", WCCP_MAILBOX_NAME,
-               static_cast<unsigned long>(length), static_cast<unsigned long>(sizeof(wccp_tunnel_mailbox)));
+        static std::atomic<bool> told; // once: this is tried again and again
+        if (!told.exchange(true))
+            QV_LOG(LC_LOG_ERR, "Block %s has %lu bytes in place of %lu and is not used", WCCP_MAILBOX_NAME,
+                   static_cast<unsigned long>(length),
+                   static_cast<unsigned long>(sizeof(wccp_tunnel_mailbox)));
         shmdt(block);
         return false;
     }

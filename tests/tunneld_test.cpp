@@ -2,8 +2,10 @@
 // once against the program.
 
 #include <gtest/gtest.h>
+#include <sched.h>
 #include <signal.h>
 #include <sys/resource.h>
+#include <sys/shm.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -46,11 +48,15 @@ void give(uint16_t code, uint16_t id, uint32_t remote, uint32_t index = WCCP_NO_
     mailbox->command = code;
 }
 
+void write_mem_conf() {
+    const std::filesystem::path conf = CMEM_CONF_PATH;
+    std::filesystem::create_directories(conf.parent_path());
+    std::ofstream(conf) << WCCP_MAILBOX_NAME << " local normal 0x51520001\n";
+}
+
 struct Tunneld : testing::Test {
     static void SetUpTestSuite() {
-        const std::filesystem::path conf = CMEM_CONF_PATH;
-        std::filesystem::create_directories(conf.parent_path());
-        std::ofstream(conf) << WCCP_MAILBOX_NAME << " local normal 0x51520001\n";
+        write_mem_conf();
         EXPECT_FALSE(tunneld_step(&before_wccpd));
         EXPECT_FALSE(before_wccpd.attached);
         mailbox = static_cast<wccp_tunnel_mailbox *>(
@@ -128,6 +134,25 @@ struct program {
 };
 
 } // namespace
+
+// First of all, while this process has attached nothing: the child has shared memory of its own.
+TEST(Mailbox, ABlockThatIsTooShortIsNotUsed) {
+    write_mem_conf();
+    const pid_t child = fork();
+    if (child == 0) {
+        if (unshare(CLONE_NEWIPC) != 0 || !cmem_create_block(4096, WCCP_MAILBOX_NAME))
+            _exit(2);
+        const bool refused = !wccp_attach_mailbox() && wccp_get_tunnel_command() == 0 && !wccp_mailbox &&
+                             wccp_get_role(65535) == 2;
+        const int key = shmget(0x51520001, 0, 0);
+        shmid_ds segment;
+        const bool let_go = shmctl(key, IPC_STAT, &segment) == 0 && segment.shm_nattch == 1;
+        _exit(refused && let_go ? 0 : 1);
+    }
+    int status = -1;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+}
 
 TEST_F(Tunneld, KeepsATableOfItsTunnels) {
     start({.first_index = 7});
