@@ -1,0 +1,179 @@
+// What a packet costs: an I-See-You of 32 routers and 32 appliances in steady state through the message loop,
+// and the two messages that this appliance builds, at their largest. Each figure comes with its ratio to a
+// floor that is measured alternately with it: the least that has to be done with the same bytes. The ratio is
+// between the fastest rounds of both, so that a busy machine doesn't show in it.
+
+#include <benchmark/benchmark.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstring>
+#include <memory>
+
+#include "engine/wccp_pkt_load.h"
+#include "engine/wccp_pkt_mgr.h"
+#include "runtime/md5.h"
+#include "tests/support/reported_group.h"
+#include "tests/support/wire_bytes.h"
+
+namespace {
+
+constexpr int ROUND = 256;
+
+template <typename Work>
+double seconds_of_round(Work work) {
+    const auto begin = std::chrono::steady_clock::now();
+    for (int i = 0; i < ROUND; i++)
+        work();
+    return std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+}
+
+// One iteration is a round of the work and a round of its floor; the time reported is that of one piece of
+// work.
+template <typename Work, typename Floor>
+void measure(benchmark::State &state, Work work, Floor floor) {
+    double best = 1e9, best_floor = 1e9;
+    for (auto _ : state) {
+        const double time = seconds_of_round(work), floor_time = seconds_of_round(floor);
+        best = std::min(best, time);
+        best_floor = std::min(best_floor, floor_time);
+        state.SetIterationTime(time / ROUND);
+    }
+    state.counters["best_ns"] = best / ROUND * 1e9;
+    state.counters["floor_ns"] = best_floor / ROUND * 1e9;
+    state.counters["ratio"] = best / best_floor;
+}
+
+// Reads every byte once.
+uint64_t read_once(const uint8_t *bytes, size_t count) {
+    uint64_t sum = 0;
+    for (size_t i = 0; i < count; i++)
+        sum += bytes[i];
+    return sum;
+}
+
+struct full_group {
+    explicit full_group(bool digested, uint32_t assign_method) {
+        wccp_service_group *group = reported.group;
+        group->security_option = digested ? 1 : 0;
+        if (digested)
+            memcpy(group->password, "password", 8);
+        for (uint32_t i = 0; i < 32; i++) {
+            routers.push_back(host(201 + i));
+            appliances.push_back({host(1 + i), 100});
+        }
+        for (const be32 router : routers)
+            reported.see(router, routers, appliances);
+        group->assign_method = assign_method;
+    }
+    reported_group reported{true};
+    std::vector<be32> routers;
+    reported_appliances appliances;
+};
+
+// The I-See-You of the last router, with the hash buckets of 32 appliances.
+std::vector<uint8_t> steady_icu(const full_group &full) {
+    const bool digested = full.reported.group->security_option == 1;
+    wire_bytes security =
+        wire_bytes().u16(0).u16(digested ? 20 : 4).u32(digested ? 1 : 0).zeros(digested ? 16 : 0);
+    wire_bytes service = wire_bytes().u16(1).u16(24).u8(1).u8(51).zeros(22);
+    wire_bytes identity = wire_bytes().u16(2).u16(20).ip(0, 232).u32(1).ip(0, 1).u32(1).ip(0, 1);
+    wire_bytes view = wire_bytes().u16(4).u16(20 + 32 * 4 + 32 * 44).u32(1).ip(0, 1).u32(1).u32(32);
+    for (uint32_t i = 0; i < 32; i++)
+        view.ip(0, 201 + i);
+    view.u32(32);
+    for (uint32_t i = 0; i < 32; i++)
+        view.ip(0, 1 + i).u32(0).zeros(i).u8(0xff).zeros(31 - i).u16(100).u16(0);
+    wire_bytes capabilities = wire_bytes().u16(8).u16(16).hex("0001000400000002 0003000400000002");
+    return wire_message(11, {security, service, identity, view, capabilities});
+}
+
+void i_see_you(benchmark::State &state, bool digested) {
+    const full_group full(digested, WCCP_ASSIGN_HASH);
+    const wccp_service_group *group = full.reported.group;
+    const std::vector<uint8_t> message = steady_icu(full);
+    const auto pkt = std::make_unique<wccp_pkt>();
+    memcpy(pkt->data, message.data(), message.size());
+    pkt->length = static_cast<uint32_t>(message.size());
+    uint8_t digest[MD5_DIGEST_BYTES];
+    wccp_pkt_digest(group, pkt.get(), digest);
+    const auto process = [&] {
+        pkt->offset = 0;
+        pkt->cursor = pkt->data;
+        if (digested)
+            memcpy(pkt->data + 16, digest, sizeof digest);
+        wccp_process_received_packet(pkt.get());
+    };
+    process();
+    const uint32_t settled = group->change_number, before = group->rx_icus;
+    if (digested)
+        measure(state, process, [&] {
+            uint8_t out[MD5_DIGEST_BYTES];
+            md5_state md5;
+            md5_init(&md5);
+            md5_append(&md5, message.data(), message.size());
+            md5_finish(&md5, out);
+            benchmark::DoNotOptimize(out);
+        });
+    else
+        measure(state, process, [&] { benchmark::DoNotOptimize(read_once(message.data(), message.size())); });
+    state.counters["bytes"] = static_cast<double>(message.size());
+    if (group->rx_icus == before || group->rx_icu_failures || wccp_g.rx_failures ||
+        group->change_number != settled)
+        state.SkipWithError("the message was not taken as it should be");
+}
+
+void build(benchmark::State &state, int (*builder)(wccp_service_group *, wccp_pkt *), uint32_t assign_method,
+           bool digested) {
+    const full_group full(digested, assign_method);
+    wccp_service_group *group = full.reported.group;
+    group->mask_dst_ip = 0x7f; // 128 values
+    group->mask_bits = 7;
+    wccp_tick(); // elects, and computes the table
+    const auto pkt = std::make_unique<wccp_pkt>();
+    int failures = 0;
+    const auto write = [&] {
+        memset(pkt.get(), 0, sizeof *pkt);
+        pkt->cursor = pkt->data;
+        failures += builder(group, pkt.get());
+    };
+    const auto copy = std::make_unique<wccp_pkt>();
+    if (digested)
+        measure(state, write, [&] {
+            uint8_t out[MD5_DIGEST_BYTES];
+            wccp_pkt_digest(group, pkt.get(), out);
+            benchmark::DoNotOptimize(out);
+        });
+    else
+        measure(state, write, [&] {
+            memset(copy.get(), 0, sizeof *copy);
+            memcpy(copy.get(), pkt.get(), pkt->length);
+            benchmark::DoNotOptimize(copy->data);
+        });
+    state.counters["bytes"] = pkt->length;
+    if (failures)
+        state.SkipWithError("the message was not built");
+}
+
+} // namespace
+
+static void rounds(benchmark::internal::Benchmark *each) {
+    each->UseManualTime()->Iterations(300);
+}
+BENCHMARK_CAPTURE(i_see_you, md5_floor_md5_of_the_bytes, true)->Apply(rounds);
+BENCHMARK_CAPTURE(i_see_you, plain_floor_reading_once, false)->Apply(rounds);
+BENCHMARK_CAPTURE(build, here_i_am_md5_floor_md5, wccp_pkt_build_here_i_am, WCCP_ASSIGN_HASH, true)
+    ->Apply(rounds);
+BENCHMARK_CAPTURE(build, here_i_am_floor_copying, wccp_pkt_build_here_i_am, WCCP_ASSIGN_HASH, false)
+    ->Apply(rounds);
+BENCHMARK_CAPTURE(build, redirect_assign_hash_floor_copying, wccp_pkt_build_redirect_assign, WCCP_ASSIGN_HASH,
+                  false)
+    ->Apply(rounds);
+BENCHMARK_CAPTURE(build, redirect_assign_mask_floor_copying, wccp_pkt_build_redirect_assign, WCCP_ASSIGN_MASK,
+                  false)
+    ->Apply(rounds);
+BENCHMARK_CAPTURE(build, redirect_assign_mask_md5_floor_md5, wccp_pkt_build_redirect_assign, WCCP_ASSIGN_MASK,
+                  true)
+    ->Apply(rounds);
+
+BENCHMARK_MAIN();
