@@ -1,0 +1,297 @@
+// The form of a line, what decides whether it is written, and the files that the log follows.
+#include "runtime/logging.h"
+
+#include <gtest/gtest.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+#include <regex>
+#include <thread>
+
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include "runtime/log_state.h"
+#include "tests/support/log_daemon.h"
+
+static constexpr const char *LINK = "/var/opt/rvl/output/sysloglevel";
+static constexpr const char *ZONE = "/var/opt/rvl/output/localtime";
+
+static void set_link(const char *target) {
+    unlink(LINK);
+    if (target) {
+        ASSERT_EQ(symlink(target, LINK), 0);
+    }
+}
+static void write_file(const char *path, const std::string &text) {
+    std::ofstream(path) << text;
+}
+static std::string read_file(const char *path) {
+    std::ifstream file(path);
+    return {std::istreambuf_iterator<char>(file), {}};
+}
+
+// The text behind the syslog head and the thread mark.
+static std::string body(const std::string &line) {
+    const size_t mark = line.find("TID ");
+    return mark == std::string::npos ? line : line.substr(line.find(": ", mark) + 2);
+}
+static bool matches(const std::string &text, const char *pattern) {
+    return std::regex_match(text, std::regex(pattern));
+}
+
+struct Log : testing::Test {
+    log_daemon daemon;
+    lc_status init(const char *name = "wccpd", uint32_t flags = 0, const char *prefix = nullptr,
+                   uint8_t destinations = 1) {
+        return lc_log_init(name, prefix, flags, 0x1060000, 7, 136, destinations);
+    }
+    void TearDown() override {
+        set_link(nullptr);
+        (void)lc_log_close();
+    }
+};
+
+// Comes first: nothing of this process has logged yet.
+TEST_F(Log, AFirstLineSetsTheLogUp) {
+    ASSERT_EQ(G_log_state_lock, nullptr);
+    LC_LOG(LC_LOG_NOTICE, "early");
+    const std::string line = daemon.one();
+    EXPECT_TRUE(matches(line, "<13>.*runtime_logging_test-UNINIT\\[\\d+\\]: TID \\d+: \\[unk\\.NOTICE\\]: "
+                              "unk: early\n"))
+        << line;
+}
+
+TEST_F(Log, ALineHasTheBytesOfVsyslog) {
+    ASSERT_EQ(init(), LC_OK);
+    for (const size_t length : {5u, 1000u, 9000u}) {
+        const std::string text(length, 'x');
+        std::string theirs, ours;
+        for (int attempt = 0; attempt < 3 && (ours.empty() || ours != theirs);
+             attempt++) { // a second may end
+            (void)lc_log_internal(nullptr, nullptr, 0, LC_LOG_FLAG_NO_THREAD, 0, LC_LOG_WARNING, "%s",
+                                  text.c_str());
+            ours = daemon.one();
+            syslog(LOG_WARNING, "[wccpd.WARNING]: %s\n", text.c_str());
+            theirs = daemon.one();
+        }
+        EXPECT_EQ(ours, theirs);
+        EXPECT_GT(ours.size(), length);
+    }
+    EXPECT_EQ(lc_log_init("wccpd", nullptr, LC_LOG_FLAG_NO_PID, 0x1060000, 7, 24, 1), LC_OK);
+    QV_LOG(LC_LOG_ERR, "x");
+    EXPECT_TRUE(matches(daemon.one(), "<27>[A-Z][a-z]{2} [ 1-3][0-9] [0-9:]{8} wccpd: TID \\d+: .*\n"));
+    closelog();
+}
+
+TEST_F(Log, TheBodyOfALine) {
+    ASSERT_EQ(init(), LC_OK);
+    QV_LOG(LC_LOG_NOTICE, "100%% of %s", "%s");
+    EXPECT_EQ(body(daemon.one()), "[wccpd.NOTICE]: 100% of %s\n");
+    (void)lc_log_internal("f", "a.cpp", 12, LC_LOG_FLAG_POSITION, 0, LC_LOG_ERR, "code %d", 5);
+    EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: f(), a.cpp:12, build 1: code 5\n");
+    (void)lc_log_internal(nullptr, nullptr, 0, 0, 0x3f00000, LC_LOG_ERR, "x");
+    EXPECT_EQ(body(daemon.one()), "[UNKNOWN_COMP.ERR]: x\n");
+    util_log(LC_LOG_ERR, "pre: ", "%d%%", 5);
+    EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: pre: 5%\n");
+    (void)qv_log_internal(LC_LOG_ERR, nullptr, "WCCP: ", "%s", "text");
+    EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: WCCP: text\n");
+    errno = ENOENT;
+    (void)lc_log_internal(nullptr, nullptr, 0, 0, 0, LC_LOG_ERR, "%m");
+    EXPECT_EQ(errno, ENOENT);
+    EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: No such file or directory\n");
+    ASSERT_EQ(init("wccpd", 0, "prefix"), LC_OK);
+    LC_LOG(LC_LOG_ERR, "text");
+    EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: prefix: text\n");
+    std::thread([] {
+        EXPECT_EQ(lc_log_set_thread_id(7), LC_OK);
+        LC_LOG(LC_LOG_ERR, "x");
+    }).join();
+    EXPECT_NE(daemon.one().find(": tid 7: ["), std::string::npos);
+    LC_LOG(LC_LOG_ERR, "x");
+    EXPECT_NE(daemon.one().find(": TID " + std::to_string(gettid()) + ": ["), std::string::npos);
+}
+
+TEST_F(Log, Stamps) {
+    ASSERT_EQ(init(), LC_OK);
+    static const struct {
+        uint32_t flags;
+        const char *pattern;
+    } rows[] = {
+        {LC_LOG_FLAG_STAMP_SEC, "\\[\\d{10}\\] "},
+        {LC_LOG_FLAG_STAMP_SEC | LC_LOG_FLAG_STAMP_TENTH, "\\[\\d{10}\\.\\d\\] "},
+        {LC_LOG_FLAG_STAMP_CENTI | LC_LOG_FLAG_MOD_TEN, "\\[\\d\\.\\d\\d\\] "},
+        {LC_LOG_FLAG_STAMP_MSEC | LC_LOG_FLAG_MOD_MILLION, "\\[\\d{1,6}\\.\\d{3}\\] "},
+        {LC_LOG_FLAG_STAMP_USEC | LC_LOG_FLAG_RELATIVE, "\\[0\\.0\\d{5}\\] "},
+    };
+    for (const auto &row : rows) {
+        (void)lc_log_internal(nullptr, nullptr, 0, row.flags, 0, LC_LOG_ERR, "x");
+        const std::string text = body(daemon.one());
+        EXPECT_TRUE(matches(text, (std::string(row.pattern) + "\\[wccpd\\.ERR\\]: x\n").c_str())) << text;
+    }
+}
+
+TEST_F(Log, WhatDoesNotFitIsCut) {
+    ASSERT_EQ(init(), LC_OK);
+    QV_LOG(LC_LOG_ERR, "%s", std::string(2000, 'y').c_str());
+    EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: " + std::string(1023, 'y') + "\n");
+    // A format that is cut at each place around its conversion.
+    for (int length = 960; length < 1020; length++) {
+        const std::string format =
+            std::string(static_cast<size_t>(length), 'z') + "%08ld" + std::string(99, 'z');
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
+        (void)lc_log_internal(nullptr, nullptr, 0, 0, 0, LC_LOG_ERR, format.c_str(), 5L);
+#pragma GCC diagnostic pop
+        const std::string text = daemon.one();
+        EXPECT_NE(text.find(std::string(900, 'z')), std::string::npos) << length;
+        EXPECT_EQ(text.find('%'), std::string::npos) << length;
+    }
+}
+
+TEST_F(Log, LevelsAndTheirOrder) {
+    ASSERT_EQ(init(), LC_OK);
+    EXPECT_EQ(G_log_level, LC_LOG_NOTICE); // no link
+    G_log_level = 7;
+    EXPECT_EQ(lc_log_set_daemon_log_level(3), LC_OK);
+    EXPECT_FALSE(lc_log_check_level(6));
+    EXPECT_EQ(syslog_get_mask(), 0xf);
+    EXPECT_EQ(lc_log_set_daemon_log_level(0), LC_OK);
+    EXPECT_TRUE(lc_log_check_level(0) && !lc_log_check_level(1));
+    EXPECT_EQ(syslog_get_mask(), 1);
+    EXPECT_EQ(lc_log_set_daemon_log_level(-1), LC_OK);
+    EXPECT_TRUE(lc_log_check_level(6));
+    EXPECT_EQ(syslog_get_mask(), 0xff);
+
+    EXPECT_EQ(lc_log_set_max_log_level("Err"), LC_BAD_TYPE);
+    EXPECT_EQ(lc_log_set_max_log_level("warning"), LC_OK);
+    EXPECT_EQ(G_log_level, LC_LOG_WARNING);
+    int evaluated = 0;
+    QV_LOG(LC_LOG_NOTICE, "%d", ++evaluated);
+    EXPECT_EQ(evaluated, 0);
+    (void)lc_log_internal(nullptr, nullptr, 0, 0, 0, LC_LOG_NOTICE, "x");
+    G_logging_suspended = 1;
+    EXPECT_EQ(lc_log_internal(nullptr, nullptr, 0, 0, 0, LC_LOG_ERR, "x"), LC_OK);
+    G_logging_suspended = 0;
+    EXPECT_EQ(daemon.take().size(), 0u);
+
+    // A line above the initial maximum passes only for a level of the process's own.
+    ASSERT_EQ(lc_log_init("wccpd", nullptr, 0, 0x1060000, LC_LOG_ERR, 136, 1), LC_OK);
+    QV_LOG(LC_LOG_NOTICE, "dropped");
+    EXPECT_EQ(lc_log_set_daemon_log_level(5), LC_OK);
+    QV_LOG(LC_LOG_NOTICE, "kept");
+    EXPECT_EQ(body(daemon.one()), "[wccpd.NOTICE]: kept\n");
+}
+
+TEST_F(Log, TheOverrideCountsWhileBothSwitchesAreOn) {
+    ASSERT_EQ(init(), LC_OK);
+    EXPECT_EQ(lc_log_set_override_log_level("debug"), LC_OK);
+    EXPECT_EQ(lc_log_enable_override_log_level(1, 1), LC_OK);
+    EXPECT_EQ(G_log_level, 5);
+    EXPECT_EQ(lc_log_enable_override_log_level(0, 1), LC_OK);
+    EXPECT_EQ(G_log_level, 7);
+    EXPECT_EQ(lc_log_set_max_log_level("err"), LC_OK); // kept for later
+    EXPECT_EQ(G_log_level, 7);
+    EXPECT_EQ(lc_log_set_override_log_level("info"), LC_OK);
+    EXPECT_EQ(G_log_level, 6);
+    EXPECT_EQ(lc_log_set_override_log_level("nonsense"), LC_OK); // ends it
+    EXPECT_EQ(G_log_level, 3);
+    EXPECT_EQ(lc_log_enable_override_log_level(0, 1), LC_OK);
+    EXPECT_EQ(G_log_level, 3);
+    EXPECT_EQ(lc_log_set_override_log_level("debug"), LC_OK);
+    EXPECT_EQ(lc_log_set_daemon_log_level(1), LC_OK);
+    EXPECT_EQ(lc_log_enable_override_log_level(1, 0), LC_OK);
+    EXPECT_EQ(G_log_level, 3);
+    EXPECT_EQ(syslog_get_mask(), 3); // the process's own level keeps it
+    EXPECT_EQ(lc_log_enable_override_log_level(0, 0), LC_OK);
+    EXPECT_EQ(lc_log_enable_override_log_level(0, 1), LC_OK);
+    EXPECT_EQ(lc_log_enable_override_log_level(1, 1), LC_OK);
+    EXPECT_EQ(G_log_level, 3); // switching the class off took the current level as the override
+}
+
+TEST_F(Log, TheLevelLink) {
+    static const struct {
+        const char *target;
+        int32_t level;
+    } rows[] = {
+        {"7", 7}, {"0", 0}, {"99", 5}, {"-3", 5}, {"x", 5}, {"3x", 5}, {"77777777777777777777777", 5}};
+    for (const auto &row : rows) {
+        set_link(row.target);
+        ASSERT_EQ(init(), LC_OK);
+        EXPECT_EQ(G_log_level, row.level) << row.target;
+        EXPECT_EQ(syslog_get_mask(), (1 << (row.level + 1)) - 1);
+    }
+}
+
+TEST_F(Log, WhoHasNoManagementFollowsTheFiles) {
+    static const char *const names[] = {"poller", "wccpd"};
+    for (const char *name : names) {
+        const bool polls = strcmp(name, "poller") == 0;
+        set_link("4");
+        write_file(ZONE, "one");
+        setenv("TZ", "XXX-5", 1);
+        ASSERT_EQ(init(name), LC_OK);
+        LC_LOG(LC_LOG_ERR, "one");
+        set_link("6");
+        timespec later[2] = {{1000000000, 0}, {1000000000, 0}};
+        ASSERT_EQ(utimensat(AT_FDCWD, ZONE, later, 0), 0);
+        usleep(1100000); // it looks once a second
+        LC_LOG(LC_LOG_ERR, "two");
+        EXPECT_EQ(G_log_level, polls ? 6 : 4);
+        EXPECT_EQ(getenv("TZ") == nullptr, polls);
+        EXPECT_EQ(daemon.take().size(), 2u);
+    }
+    unsetenv("TZ");
+    unlink(ZONE);
+}
+
+TEST_F(Log, AConsoleGetsAHeadAndKeepsItsLevel) {
+    ASSERT_EQ(init("tool", 0, nullptr, LOG_TO_STDERR), LC_OK);
+    EXPECT_EQ(lc_log_set_max_log_level("emerg"), LC_OK);
+    EXPECT_EQ(G_log_level, LC_LOG_NOTICE);
+    testing::internal::CaptureStderr();
+    LC_LOG(LC_LOG_ERR, "seen %d", 1);
+    (void)lc_log_internal(nullptr, nullptr, 0, LC_LOG_FLAG_NO_HEADER, 0, LC_LOG_ERR, "bare");
+    const std::string text = testing::internal::GetCapturedStderr();
+    EXPECT_TRUE(matches(text, "[A-Z][a-z]{2} [ 1-3][0-9] [0-9:]{8} [^ .]+ tool\\[\\d+\\]: TID \\d+: "
+                              "\\[wccpd\\.ERR\\]: seen 1\nTID \\d+: \\[wccpd\\.ERR\\]: bare\n"))
+        << text;
+    EXPECT_EQ(daemon.take().size(), 0u);
+}
+
+TEST_F(Log, AfterTheCloseLinesAreDropped) {
+    ASSERT_EQ(init(), LC_OK);
+    EXPECT_EQ(lc_log_close(), LC_OK);
+    EXPECT_EQ(lc_log_close(), LC_NULL);
+    EXPECT_EQ(lc_log_internal(nullptr, nullptr, 0, 0, 0, LC_LOG_ERR, "x"), LC_GENERIC);
+    EXPECT_EQ(lc_log_set_max_log_level("err"), LC_NULL); // its own failure finds no log, and no deadlock
+    EXPECT_EQ(daemon.take().size(), 0u);
+    ASSERT_EQ(init(), LC_OK);
+    EXPECT_STREQ(lc_log_get_lls_process_name(), "wccpd");
+    EXPECT_EQ(lc_log_init(nullptr, nullptr, 0, 0, 7, 136, 1), LC_NULL);
+    EXPECT_NE(daemon.one().find("Unexpected NULL"), std::string::npos);
+}
+
+TEST(Facility, IsReadFromItsFile) {
+    static constexpr const char *FILE_PATH = "/var/opt/rvl/syslog_fac.conf";
+    unlink(FILE_PATH);
+    EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 136);
+    write_file(FILE_PATH, "# system 8\nflow 144\nsystem\n\nsystem 160\nsystem 176\n");
+    EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 160);
+    EXPECT_EQ(lc_log_get_facility(nullptr, "mgmtctl"), 136);
+    EXPECT_TRUE(
+        matches(read_file("/var/log/debug_log"), "\\d{6} \\d{6} Skipping facility type: flow for wccpd\n"));
+    unlink(FILE_PATH);
+}
+
+TEST(DebugLog, IsTruncatedOnceItIsLarge) {
+    static constexpr const char *FILE_PATH = "/var/log/debug_log";
+    write_file(FILE_PATH, std::string(1999999, 'x') + "\n");
+    EXPECT_EQ(lc_log_file(nullptr, "%d", 1), 0);
+    EXPECT_GT(std::filesystem::file_size(FILE_PATH), 2000000u);
+    EXPECT_EQ(lc_log_file(nullptr, "%d", 2), 0);
+    EXPECT_TRUE(matches(read_file(FILE_PATH), "\\d{6} \\d{6} 2\n"));
+    EXPECT_EQ(lc_log_file("/no/such/directory", "x"), 1);
+    unlink(FILE_PATH);
+}
