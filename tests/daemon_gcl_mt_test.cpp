@@ -124,8 +124,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
         senders[i].start();
     }
     std::atomic<bool> over{false};
-    // Cancelled in mid-send again and again. A frame may have gone with its number not yet counted up; the
-    // sender's next life then sends that number again.
+    // Cancelled at any moment, again and again: what it was sending goes out whole, and is counted as sent.
     std::thread canceller([&] {
         std::minstd_rand random(7);
         while (!over) {
@@ -135,7 +134,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
         }
     });
 
-    uint32_t expected[4] = {}, repeated = 0, frames = 0, acknowledged = 0, sequence = 2000003;
+    uint32_t expected[4] = {}, frames = 0, acknowledged = 0, sequence = 2000003;
     std::minstd_rand random(1);
     const double end = now_seconds() + (stress() ? 60 : 3);
     bool draining = false;
@@ -158,10 +157,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
         ASSERT_EQ(number_at(frame, 20), sequence++);
         ASSERT_TRUE(who >= 1 && who <= 3);
         const uint32_t number = number_at(frame, 32);
-        if (who == 3 && number + 1 == expected[who])
-            repeated++;
-        else
-            ASSERT_EQ(number, expected[who]++) << who;
+        ASSERT_EQ(number, expected[who]++) << who;
         ASSERT_EQ(frame.find_first_not_of(static_cast<char>('a' + who), 36), wire::npos);
         frames++;
         if (random() % 200 == 0) { // a burst of acknowledgements
@@ -174,9 +170,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
         }
     }
     for (uint16_t i = 1; i <= 3; i++)
-        EXPECT_LE(senders[i - 1].next, expected[i]);
-    EXPECT_EQ(senders[0].next, expected[1]);
-    EXPECT_EQ(senders[1].next, expected[2]);
+        EXPECT_EQ(senders[i - 1].next, expected[i]);
     EXPECT_GT(frames, 100u);
     for (const double start = now_seconds();
          session.acknowledged < static_cast<int>(acknowledged) && now_seconds() - start < 5;)
@@ -186,8 +180,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
     EXPECT_EQ(lew_escape_from_dispatch(session.client.wrapper), LC_OK);
     session.thread.join();
     session.client.finish();
-    printf("%u frames, %u acknowledgements, %u repeated after a cancellation\n", frames, acknowledged,
-           repeated);
+    printf("%u frames, %u acknowledgements\n", frames, acknowledged);
 }
 
 // The provider closes at random moments, while the loop's thread reads and others send. The session ends on
