@@ -3,11 +3,13 @@
 
 #include <cstring>
 #include <memory>
+#include <string>
 #include <vector>
 
 #include <gtest/gtest.h>
 
 #include "engine/wccp_state.h"
+#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
 namespace {
@@ -58,6 +60,46 @@ TEST_F(RouterTest, EachMethodIsAgreedByItsOwnRule) {
             ASSERT_EQ(decide(fwd | 0xfffffffc, assign | 0x100, ret | 4), expected);
         }
     }
+}
+
+TEST_F(RouterTest, RefusalsAndRoutersAreToldInTheLog) {
+    log_lines log;
+    const auto tells = [&log](const std::string &line) {
+        const std::string lines = log.take();
+        EXPECT_NE(lines.find(line), std::string::npos) << line << "\n-- among --\n" << lines;
+    };
+    configure(WCCP_METHOD_L2, WCCP_ASSIGN_MASK);
+    decide(0xfd, 3, 2);
+    tells("WCCP GRP 51: incompatible capabilities (router id 10.0.0.201) : local: (fwd encap: "
+          "L2 ) router sent: (fwd: gre return: L2)");
+    decide(3, 1, 3);
+    tells("WCCP GRP 51: incompatible capabilities (router id 10.0.0.201) : local assign "
+          "method: "
+          "mask  router assign method: hash");
+    decide(3, 3, 0);
+    tells("WCCP GRP 51: incompatible capabilities (router id 10.0.0.201) : local return "
+          "method: "
+          "gre or L2  router return method: none");
+    const wccp_rtr_capabilities agreed = {2, 1, 2};
+    wccp_create_sending_router(group, ROUTER_A, &agreed, &agreed);
+    const std::string created = log.take();
+    size_t from = 0; // in this order
+    for (const char *line : {"WCCP GRP 51: agreed capabilities: fwd: 2 assign: 1 return: 2 deciding rtr id "
+                             "10.0.0.201",
+                             "WCCP GRP 51: alarm: schedule router connectivity verify timer in 60 seconds",
+                             "WCCP GRP 51: created ICU sending router 10.0.0.201 "}) {
+        from = created.find(line, from);
+        ASSERT_NE(from, std::string::npos) << line << "\n-- among --\n" << created;
+    }
+    wccp_create_sending_router(group, {}, &agreed, &agreed);
+    tells("WCCP GRP 51: invalid router id in ICU. 0.0.0.0");
+    uint32_t buckets;
+    wccp_get_router_assignment(group, shared->router(ROUTER_A), host(3), &buckets);
+    tells("WCCP GRP 51: get router assign. failed. cannot find appliance 10.0.0.3 in router's view: "
+          "10.0.0.201");
+    wccp_g.seconds += 40;
+    wccp_monitor_sending_routers(group);
+    tells("WCCP GRP 51: removing router (router id: 10.0.0.201) due to inactivity.");
 }
 
 TEST_F(RouterTest, WhatTheFirstRouterAgreedHoldsForAll) {

@@ -12,6 +12,7 @@
 #include "engine/wccp_host.h"
 #include "engine/wccp_router_utils.h"
 #include "platform/qvcommon.h"
+#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
 struct state_event {
@@ -327,6 +328,43 @@ TEST_F(StateTest, TheDesignatedComparesWhatItAskedFor) {
     shared->router(ROUTER_B)->view_appliances[0].buckets_assigned = 128;
     shared->router(ROUTER_B)->view_appliances[2].weight = 1; // and no buckets
     EXPECT_FALSE(check());
+}
+
+TEST_F(StateTest, AlarmsAreToldInTheLogAndFailWithoutASession) {
+    log_lines log;
+    const auto tells = [&log](const std::vector<std::string> &wanted) {
+        const std::string lines = log.take();
+        size_t from = 0;
+        for (const std::string &line : wanted) {
+            from = lines.find(line, from);
+            ASSERT_NE(from, std::string::npos) << line << "\n-- among --\n" << lines;
+        }
+    };
+    group->ucast_router_count = 2;
+    see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(2), 7}});
+    log.take();
+    wccp_alarm_verify_router_connectivity(group);
+    tells({"WCCP GRP 51: alarm: verify router connectivity.",
+           "WCCP GRP 51: alarm: raising router down alarm. routers configured: 2 connections one-way: 0 "
+           "two-way: 1",
+           "WCCP GRP 51: alarm: raising adjacency down alarm", "Error code 14001"});
+    group->ucast_router_count = 1;
+    wccp_alarm_verify_router_connectivity(group);
+    tells({"WCCP GRP 51: alarm: clearing router down alarm: routers one-way: 0 two-way: 1 configured: 1.",
+           "WCCP GRP 51: alarm: clearing adjacency down alarm"});
+    wccp_alarm_verify_router_connectivity(group);
+    tells({"WCCP GRP 51: alarm: router verification is ok. configured: 1 one-way: 0 two-way: 1"});
+    shared->router(ROUTER_A)->view_appliances[0].buckets_assigned = 9;
+    wccp_alarms_verify_allocation_table(group);
+    tells({"WCCP GRP 51: alarm: verify assignment table.", "WCCP GRP 51: alarm: verify by non-designator.",
+           "WCCP GRP 51: alarm: router 10.0.0.201 is not redirecting to appliance (10.0.0.2 weight 7)",
+           "WCCP GRP 51: alarm: raising assignment table mismatch alarm"});
+    pass_seconds(1);
+    log.take();
+    wccp_alarms_verify_allocation_table(group); // designated by now
+    tells({"WCCP GRP 51: alarm: verify allocation. appliance 10.0.0.",
+           "WCCP GRP 51: alarm: allocation mismatch. appliance 10.0.0."});
+    EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ASSIGNMENT);
 }
 
 TEST_F(StateTest, AnyOtherLooksForHoles) {

@@ -16,6 +16,7 @@
 #include "engine/wccp_state.h"
 #include "engine/wccp_utils.h"
 #include "engine/wccp_wire.h"
+#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
 namespace {
@@ -361,7 +362,10 @@ struct RedirectTest : ViewTest {
         for (const be32 id : {ROUTER_A, ROUTER_B, ROUTER_C})
             report(id, {{US, 100}, {host(2), 100}});
     }
-    void follow(const std::vector<redirect_step> &steps) {
+    // The texts of the redirect lines that the steps bring.
+    void follow(const std::vector<redirect_step> &steps, const std::vector<std::string> &lines = {}) {
+        log_lines log;
+        std::vector<std::string> told;
         for (size_t i = 0; i < steps.size(); i++) {
             const redirect_step &step = steps[i];
             wccp_sending_router *from = router(step.from);
@@ -374,43 +378,68 @@ struct RedirectTest : ViewTest {
             EXPECT_EQ(group->state_flags & WCCP_STATE_MASK, step.state) << "step " << i;
             EXPECT_EQ(from->self_buckets, step.self);
             EXPECT_EQ(from->total_buckets, step.total);
+            const std::string text = log.take(), begin = "WCCP GRP 51: redirect: ";
+            if (const size_t at = text.find(begin); at != std::string::npos)
+                told.push_back(
+                    text.substr(at + begin.size(), text.find_first_of("\n<", at) - at - begin.size()));
+        }
+        if (!lines.empty()) {
+            EXPECT_EQ(told, lines);
         }
     }
 };
 
 TEST_F(RedirectTest, TheFirstRouterMakesActiveAndTheLastDecides) {
-    follow({
-        {ROUTER_A, 128, 256, 1, WCCP_STATE_ACTIVE},
-        {ROUTER_A, 100, 256, 1, WCCP_STATE_ACTIVE},
-        {ROUTER_B, 128, 256, 2, WCCP_STATE_ACTIVE},
-        {ROUTER_A, 0, 256, 1, WCCP_STATE_ACTIVE},
-        {ROUTER_A, 0, 200, 1, WCCP_STATE_ACTIVE},
-        {ROUTER_B, 0, 256, 0, WCCP_STATE_BACKUP}, // it assigns elsewhere itself
-        {ROUTER_B, 256, 256, 1, WCCP_STATE_ACTIVE},
-        {ROUTER_B, 0, 0, 0, WCCP_STATE_BACKUP}, // A still assigns elsewhere
-        {ROUTER_A, 0, 0, 0, WCCP_STATE_INIT},   // nobody does any more
-    });
+    follow(
+        {
+            {ROUTER_A, 128, 256, 1, WCCP_STATE_ACTIVE},
+            {ROUTER_A, 100, 256, 1, WCCP_STATE_ACTIVE},
+            {ROUTER_B, 128, 256, 2, WCCP_STATE_ACTIVE},
+            {ROUTER_A, 0, 256, 1, WCCP_STATE_ACTIVE},
+            {ROUTER_A, 0, 200, 1, WCCP_STATE_ACTIVE},
+            {ROUTER_B, 0, 256, 0, WCCP_STATE_BACKUP}, // it assigns elsewhere itself
+            {ROUTER_B, 256, 256, 1, WCCP_STATE_ACTIVE},
+            {ROUTER_B, 0, 0, 0, WCCP_STATE_BACKUP}, // A still assigns elsewhere
+            {ROUTER_A, 0, 0, 0, WCCP_STATE_INIT},   // nobody does any more
+        },
+        {
+            "first router to self (router id 10.0.0.201 )",
+            "last router stopped redirecting to self. (router id 10.0.0.202)",
+            "first router to self (router id 10.0.0.202 )",
+            "this rtr (id 10.0.0.202) does not redirect. but another router does",
+            "no routers redirecting to group (router id 10.0.0.201)",
+        });
     EXPECT_EQ(group->transitions, 4u);
 }
 
 TEST_F(RedirectTest, TheOnlyRedirectingRouterStops) {
-    follow({
-        {ROUTER_A, 256, 256, 1, WCCP_STATE_ACTIVE},
-        {ROUTER_B, 256, 256, 2, WCCP_STATE_ACTIVE},
-        {ROUTER_B, 0, 0, 1, WCCP_STATE_ACTIVE},
-        {ROUTER_A, 0, 0, 0, WCCP_STATE_INIT},
-    });
+    follow(
+        {
+            {ROUTER_A, 256, 256, 1, WCCP_STATE_ACTIVE},
+            {ROUTER_B, 256, 256, 2, WCCP_STATE_ACTIVE},
+            {ROUTER_B, 0, 0, 1, WCCP_STATE_ACTIVE},
+            {ROUTER_A, 0, 0, 0, WCCP_STATE_INIT},
+        },
+        {
+            "first router to self (router id 10.0.0.201 )",
+            "rtr does not redirect. no redirecting routers (router id 10.0.0.201)",
+        });
 }
 
 TEST_F(RedirectTest, EverythingElsewhereFromTheStartIsBackup) {
-    follow({
-        {ROUTER_A, 0, 256, 0, WCCP_STATE_BACKUP},
-        {ROUTER_B, 0, 256, 0, WCCP_STATE_BACKUP},
-        {ROUTER_A, 0, 0, 0, WCCP_STATE_BACKUP},
-        {ROUTER_C, 0, 64, 0, WCCP_STATE_BACKUP},
-        {ROUTER_B, 0, 0, 0, WCCP_STATE_BACKUP},
-        {ROUTER_C, 0, 0, 0, WCCP_STATE_INIT},
-    });
+    follow(
+        {
+            {ROUTER_A, 0, 256, 0, WCCP_STATE_BACKUP},
+            {ROUTER_B, 0, 256, 0, WCCP_STATE_BACKUP},
+            {ROUTER_A, 0, 0, 0, WCCP_STATE_BACKUP},
+            {ROUTER_C, 0, 64, 0, WCCP_STATE_BACKUP},
+            {ROUTER_B, 0, 0, 0, WCCP_STATE_BACKUP},
+            {ROUTER_C, 0, 0, 0, WCCP_STATE_INIT},
+        },
+        {
+            "router id 10.0.0.201 is redirecting to other  appliance(s).",
+            "no routers redirecting to group (router id 10.0.0.203)",
+        });
     EXPECT_EQ(group->transitions, 1u);
 }
 

@@ -18,11 +18,11 @@ log_lines::log_lines() : fd(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0)) {
     strcpy(address.sun_path, LOG_SOCKET);
     EXPECT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&address), sizeof address), 0);
     lc_log_init("wccpd", "wccpd", 0, 0x1060000, LC_LOG_INFO, 128, 1);
-    G_daemon_log_level = LC_LOG_INFO;
+    lc_log_set_daemon_log_level(LC_LOG_INFO);
 }
 
 log_lines::~log_lines() {
-    G_daemon_log_level = -1;
+    lc_log_set_daemon_log_level(-1);
     lc_log_close();
     close(fd);
     unlink(LOG_SOCKET);
