@@ -10,7 +10,7 @@
 //
 // A daemon that goes takes its socket along: the next line connects again. One that stands still while
 // another takes over its path is noticed by the socket file when a line would be lost. Without /dev/log lines
-// are lost quietly, at the price of a failed connect. As in the C library, a /dev/log that is a stream gets
+// are lost quietly, at the price of a look at the path. As in the C library, a /dev/log that is a stream gets
 // each line with its NUL.
 //
 // One line is made in a buffer of this file, under the log's lock; only a line that is longer allocates.
@@ -55,14 +55,15 @@ void syslog_socket_close(syslog_socket *log) {
 }
 
 static int connect_as(syslog_socket *log, int type) {
+    struct stat file = {}; // looked at ahead of the connect: a later change is then seen as one
+    if (stat(LOG_PATH, &file) != 0)
+        return errno;
     const int fd = socket(AF_UNIX, type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
     if (fd < 0)
         return errno;
     sockaddr_un address = {};
     address.sun_family = AF_UNIX;
     strlcpy(address.sun_path, LOG_PATH, sizeof address.sun_path);
-    struct stat file = {};
-    (void)stat(LOG_PATH, &file); // ahead of the connect: a later change is then seen as one
     if (connect(fd, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0) {
         const int failure = errno;
         close(fd);

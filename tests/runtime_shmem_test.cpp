@@ -1,0 +1,246 @@
+// Shared blocks and display buffers. Each case of shared blocks runs in a child with keys of its own, since a
+// process keeps its registry.
+#include "runtime/cmem.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <functional>
+#include <memory>
+
+#include <csignal>
+#include <sched.h>
+#include <sys/shm.h>
+#include <sys/wait.h>
+
+#include "runtime/csys.h"
+#include "runtime/logging.h"
+#include "tests/support/log_daemon.h"
+
+constexpr uint64_t BLOCK_BYTES = 10000; // 12288 in pages
+constexpr key_t BLOCK_KEY = 0x12345;
+constexpr size_t REGISTRY_BYTES = 361608;
+
+static void write_conf(const std::string &text) {
+    std::ofstream(CMEM_CONF_PATH) << text;
+}
+
+// What went wrong in the child, on standard error; 0 for nothing, else the wait status.
+static int in_process(bool own_keys, const std::function<void()> &body) {
+    fflush(nullptr);
+    const pid_t child = fork();
+    if (child == 0) {
+        if (own_keys && unshare(CLONE_NEWIPC) != 0)
+            _exit(99);
+        body();
+        fflush(nullptr);
+        _exit(testing::Test::HasFailure());
+    }
+    int status = -1;
+    (void)waitpid(child, &status, 0);
+    return status;
+}
+
+struct Blocks : testing::Test {
+    log_daemon daemon;
+    void SetUp() override {
+        ASSERT_EQ(lc_log_init("shmem", nullptr, 0, 0x1060000, 7, 136, 1), LC_OK);
+        (void)lc_log_set_daemon_log_level(7);
+        write_conf("# the blocks\n\nblock local normal 12345\nother\tinter\tnormal\t0x12346\n");
+    }
+    void TearDown() override { (void)lc_log_close(); }
+    // True when exactly one line came and it has this text.
+    bool told(const std::string &text) {
+        const std::string line = daemon.one();
+        if (line.find(text) != std::string::npos)
+            return true;
+        fprintf(stderr, "no \"%s\" but \"%s\"\n", text.c_str(), line.c_str());
+        return false;
+    }
+};
+#define IN_CHILD(...)                                                                                        \
+    do {                                                                                                     \
+        const int child_status = in_process(true, [&]() __VA_ARGS__);                                        \
+        EXPECT_EQ(child_status, 0);                                                                          \
+    } while (0)
+
+TEST_F(Blocks, ANewBlockIsFoundByOthers) {
+    IN_CHILD({
+        EXPECT_EQ(cmem_exists_block("block"), 0);
+        auto *block = static_cast<uint8_t *>(cmem_create_block(BLOCK_BYTES, "block"));
+        ASSERT_NE(block, nullptr);
+        shmid_ds status = {};
+        ASSERT_EQ(shmctl(shmget(BLOCK_KEY, 0, 0), IPC_STAT, &status), 0);
+        EXPECT_EQ(status.shm_segsz, 12288u);
+        EXPECT_EQ(status.shm_perm.mode & 0777, 0777);
+        block[12287] = 5;
+        EXPECT_EQ(cmem_exists_block("block"), 1);
+        EXPECT_EQ(cmem_exists_block("other"), 0);
+        uint64_t length = 0;
+        const auto *again = static_cast<uint8_t *>(cmem_attach_block("block", &length));
+        ASSERT_NE(again, nullptr);
+        EXPECT_EQ(length, 12288u);
+        EXPECT_EQ(again[12287], 5);
+        EXPECT_EQ(cmem_create_block(BLOCK_BYTES, "block"), nullptr);
+        const std::string pid = std::to_string(getpid());
+        EXPECT_TRUE(told("cmem_create_block: double create attempt for memory block block, old pid=" + pid +
+                         ", new pid=" + pid + "\n"));
+        EXPECT_EQ(cmem_attach_block("nobody"), nullptr);
+        EXPECT_TRUE(told("cmem_attach_block: memory block nobody not found\n"));
+    });
+}
+
+TEST_F(Blocks, TheRegistryHasItsFormat) {
+    IN_CHILD({
+        ASSERT_NE(cmem_create_block(BLOCK_BYTES, "block"), nullptr);
+        const int id = shmget(CMEM_REGISTRY_KEY, 0, 0);
+        shmid_ds status = {};
+        ASSERT_EQ(shmctl(id, IPC_STAT, &status), 0);
+        EXPECT_EQ(status.shm_segsz, REGISTRY_BYTES);
+        const auto *bytes = static_cast<const uint8_t *>(shmat(id, nullptr, SHM_RDONLY));
+        const auto word = [&](size_t at) {
+            uint32_t value;
+            memcpy(&value, bytes + at, sizeof value);
+            return value;
+        };
+        EXPECT_STREQ(reinterpret_cast<const char *>(bytes), "block");
+        EXPECT_EQ(word(64), 12288u);
+        EXPECT_EQ(word(72), 4096u);
+        EXPECT_EQ(word(80), static_cast<uint32_t>(-2));
+        EXPECT_EQ(word(84), 0x12345u);
+        EXPECT_EQ(word(112), static_cast<uint32_t>(getpid()));
+        EXPECT_EQ(word(156), 1u);
+        EXPECT_EQ(word(160), 1u);
+        EXPECT_STREQ(reinterpret_cast<const char *>(bytes + 336064), "other");
+        EXPECT_EQ(word(336064 + 48), static_cast<uint32_t>(-1));
+        EXPECT_EQ(word(336064 + 52), 0x12346u);
+        EXPECT_EQ(word(361600), 1u);
+    });
+}
+
+TEST_F(Blocks, TheNextProcessTakesOverWhatIsLeft) {
+    IN_CHILD({
+        EXPECT_EQ(in_process(false,
+                             [] {
+                                 void *block = cmem_create_block(BLOCK_BYTES, "block");
+                                 ASSERT_NE(block, nullptr);
+                                 memset(block, 0xff, 12288);
+                             }),
+                  0);
+        EXPECT_EQ(cmem_create_block(BLOCK_BYTES * 2, "block"), nullptr);
+        EXPECT_TRUE(told("length change attempt for memory block block, old len=12288, new len=20480\n"));
+        const int id = shmget(BLOCK_KEY, 0, 0);
+        const auto *block = static_cast<const uint8_t *>(cmem_create_block(BLOCK_BYTES + 1, "block"));
+        ASSERT_NE(block, nullptr);
+        EXPECT_EQ(shmget(BLOCK_KEY, 0, 0), id);
+        for (size_t i = 0; i < 12288; i++)
+            ASSERT_EQ(block[i], 0) << i;
+        EXPECT_EQ(daemon.take().size(), 0u);
+    });
+}
+
+TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
+    IN_CHILD({
+        ASSERT_GE(shmget(BLOCK_KEY, 4096, IPC_CREAT | 0777), 0);
+        EXPECT_EQ(cmem_create_block(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_TRUE(
+            told("cmem_create_block: cannot attach/shmget shared block block, length=12288, key=12345, "
+                 "pagesize=4096, shmid=-1, err=Invalid argument, errno=22, check SHMMAX\n"));
+        EXPECT_EQ(cmem_exists_block("block"), 0); // its record is free again
+        // Behind a block that stands in the registry a shorter one has appeared.
+        ASSERT_NE(cmem_create_block(BLOCK_BYTES, "other"), nullptr);
+        ASSERT_EQ(shmctl(shmget(0x12346, 0, 0), IPC_RMID, nullptr), 0);
+        EXPECT_EQ(cmem_exists_block("other"), 0);
+        EXPECT_TRUE(told("cannot shmget to shared block other, err=No such file or directory\n"));
+        ASSERT_GE(shmget(0x12346, 4096, IPC_CREAT | 0777), 0);
+        EXPECT_EQ(cmem_attach_block("other"), nullptr);
+        EXPECT_TRUE(told("cannot shmget shared block other, key=74566, err=Invalid argument\n"));
+    });
+    IN_CHILD({ // exactly as long as needed, but no whole pages
+        ASSERT_GE(shmget(BLOCK_KEY, BLOCK_BYTES, IPC_CREAT | 0777), 0);
+        EXPECT_NE(cmem_create_block(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_NE(cmem_attach_block("block"), nullptr);
+    });
+}
+
+TEST_F(Blocks, ARegistryThatIsTooShortEndsTheProcess) {
+    for (const size_t bytes : {size_t{1}, REGISTRY_BYTES - 1}) {
+        const int status = in_process(true, [&] {
+            ASSERT_GE(shmget(CMEM_REGISTRY_KEY, bytes, IPC_CREAT | 0777), 0);
+            (void)cmem_attach_block("block");
+        });
+        EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
+        EXPECT_TRUE(told(": Cannot attach to shmem, err=Invalid argument\n"));
+    }
+}
+
+TEST_F(Blocks, LinesOfTheConfiguration) {
+    const std::string longest(31, 'n');
+    std::string conf = "bad 12 normal 1\n  # bad local normal 1\nbad\nworse inter enormous 1\n" +
+                       std::string(300, 'b') + " bad local normal 1\n" + longest + "cut local normal 2a\n" +
+                       "registry local normal beeffeed\nnokey local normal\nbig local normal 123456789\n"
+                       "words local normal 12x\nat 0 normal 77 10000000000\n";
+    for (int i = 0; i < 500; i++)
+        conf += "many" + std::to_string(i) + " local normal " + std::to_string(500 + i) + "\n";
+    write_conf(conf);
+    IN_CHILD({
+        EXPECT_NE(cmem_create_block(1, longest.c_str()), nullptr);
+        EXPECT_GE(shmget(0x2a, 0, 0), 0);
+        std::vector<std::string> lines = daemon.take();
+        ASSERT_EQ(lines.size(), 4u);
+        EXPECT_NE(lines[0].find(": error parsing affinity at line bad 12 normal 1\n"), std::string::npos);
+        EXPECT_NE(lines[1].find(": error parsing affinity at line bad\n"), std::string::npos);
+        EXPECT_NE(lines[2].find(": error parsing page size at line worse inter enormous 1\n"),
+                  std::string::npos);
+        EXPECT_NE(lines[3].find("affinity at line " + std::string(255, 'b') + "\n"), std::string::npos);
+        for (const char *name : {"bad", "worse", "registry", "nokey", "big", "words", "unlisted"}) {
+            EXPECT_EQ(cmem_create_block(1, name), nullptr);
+            EXPECT_TRUE(
+                told(std::string("attempt to create shared block ") + name + " conflicts with conf file\n"));
+        }
+        EXPECT_EQ(cmem_create_block(1, "at"), reinterpret_cast<void *>(0x10000000000));
+        EXPECT_NE(cmem_create_block(1, "many300"), nullptr);
+        EXPECT_EQ(cmem_create_block(1, "many499"), nullptr); // beyond the table
+    });
+}
+
+TEST_F(Blocks, ALengthBeyondAllMemoryIsRefused) {
+    IN_CHILD({
+        EXPECT_EQ(cmem_create_block(UINT64_MAX, "block"), nullptr);
+        EXPECT_TRUE(told("cannot attach/shmget shared block block"));
+        EXPECT_EQ(cmem_create_block(0, "block"), nullptr);
+    });
+}
+
+// --- Display buffers
+
+TEST(DisplayBuffer, HoldsWhatFits) {
+    for (const uint32_t offset : {0u, 1u, 3u}) { // on any address
+        const std::unique_ptr<char[]> memory(new char[1024 + offset]);
+        csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.get() + offset, 1024);
+        ASSERT_NE(buffer, nullptr);
+        EXPECT_EQ(csys_display_buf_bytes_max(buffer), 991u);
+        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, ""), 0u);
+        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "abc"), 3u);
+        EXPECT_STREQ(csys_display_buf_text(buffer), "abc");
+        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, std::string(1000, 'x').c_str()), 0u);
+        EXPECT_EQ(csys_display_buf_text(buffer), "abc" + std::string(987, 'x') + "\n");
+        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "y"), 0u);
+        EXPECT_EQ(csys_display_buf_bytes_used(buffer), 991u);
+        EXPECT_EQ(csys_display_buf_bytes_max(buffer), 991u);
+        EXPECT_EQ(csys_chk_display_buf(buffer), 0);
+
+        buffer = csys_create_safe_display_buf_desc(memory.get() + offset, 1024);
+        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, std::string(991, 'x').c_str()), 991u);
+        EXPECT_EQ(csys_display_buf_text(buffer), std::string(991, 'x')); // full, not cut
+        memory[1024 + offset - 32] ^= 1;
+        EXPECT_EQ(csys_chk_display_buf(buffer), 1);
+        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "y"), 0u);
+    }
+    char small[33];
+    EXPECT_EQ(csys_create_safe_display_buf_desc(small, 32), nullptr);
+    csys_display_buf *buffer = csys_create_safe_display_buf_desc(small, 33);
+    ASSERT_NE(buffer, nullptr);
+    EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "x"), 0u);
+    EXPECT_STREQ(csys_display_buf_text(buffer), "");
+}

@@ -1,0 +1,218 @@
+// The log and its daemon: one that reads, one that stands still, one that goes and comes back, none at all;
+// threads that are cancelled while they log, and a process that forks then.
+#include "runtime/logging.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <memory>
+#include <thread>
+
+#include <pthread.h>
+#include <sys/wait.h>
+
+#include "tests/support/log_daemon.h"
+
+static int64_t now_ms() {
+    return std::chrono::duration_cast<std::chrono::milliseconds>(
+               std::chrono::steady_clock::now().time_since_epoch())
+        .count();
+}
+static void log_numbered(int from, int to) {
+    for (int i = from; i < to; i++) {
+        QV_LOG(LC_LOG_DEBUG, "line %d.", i);
+    }
+}
+// The number behind `words`, -1 without them.
+static int number_in(const std::string &line, const char *words) {
+    const size_t at = line.find(words);
+    return at == std::string::npos ? -1 : atoi(line.c_str() + at + strlen(words));
+}
+static void expect_lines(const std::vector<std::string> &lines, size_t begin, int from, int to) {
+    ASSERT_EQ(lines.size() - begin, static_cast<size_t>(to - from));
+    for (int i = from; i < to; i++)
+        ASSERT_EQ(number_in(lines[begin + static_cast<size_t>(i - from)], "line "), i);
+}
+// More than a socket's queue and send buffer hold.
+constexpr int FLOOD = 1000;
+// What a stopped daemon may cost in all. The patience is 20 ms; the rest is for a busy machine.
+constexpr int64_t COST_MS = 120;
+
+struct Syslog : testing::TestWithParam<int> {
+    std::unique_ptr<log_daemon> daemon;
+    void SetUp() override {
+        daemon = std::make_unique<log_daemon>(GetParam());
+        ASSERT_EQ(lc_log_init("wccpd", nullptr, 0, 0x1060000, 7, 136, 1), LC_OK);
+        ASSERT_EQ(lc_log_set_daemon_log_level(7), LC_OK);
+    }
+    void TearDown() override { (void)lc_log_close(); }
+};
+INSTANTIATE_TEST_SUITE_P(Sockets, Syslog, testing::Values(SOCK_DGRAM, SOCK_STREAM),
+                         [](const auto &kind) { return kind.param == SOCK_DGRAM ? "datagram" : "stream"; });
+
+TEST_P(Syslog, ABurstArrivesWholeAndInOrder) {
+    std::vector<std::string> lines;
+    std::thread reader([&] { lines = daemon->take(2000, 500); });
+    log_numbered(0, 500);
+    reader.join();
+    expect_lines(lines, 0, 0, 500);
+}
+
+TEST_P(Syslog, ASlowReaderGetsEveryLine) {
+    std::vector<std::string> lines;
+    std::thread reader([&] {
+        while (lines.size() < 500) {
+            const std::vector<std::string> more = daemon->take(2000, 1);
+            if (more.empty())
+                return;
+            lines.insert(lines.end(), more.begin(), more.end());
+            usleep(lines.size() % 100 ? 100 : 5000);
+        }
+    });
+    log_numbered(0, 500);
+    reader.join();
+    expect_lines(lines, 0, 0, 500);
+}
+
+TEST_P(Syslog, AStoppedReaderCostsMillisecondsAndIsTold) {
+    const int64_t began = now_ms();
+    errno = EAGAIN; // as a drained socket of the caller's leaves it
+    log_numbered(0, FLOOD);
+    const int64_t took = now_ms() - began;
+    EXPECT_LT(took, COST_MS);
+    RecordProperty("milliseconds", static_cast<int>(took));
+    std::vector<std::string> lines = daemon->take();
+    const int got = static_cast<int>(lines.size());
+    ASSERT_LT(got, FLOOD);
+    expect_lines(lines, 0, 0, got);
+
+    QV_LOG(LC_LOG_NOTICE, "line %d.", FLOOD);
+    lines = daemon->take();
+    ASSERT_EQ(lines.size(), 2u);
+    EXPECT_EQ(number_in(lines[0], "messages lost due to non-blocking syslog (count="), FLOOD - got);
+    EXPECT_EQ(lines[0].compare(0, 5, "<139>"), 0);
+    EXPECT_EQ(lines[0].back(), ')'); // no thread mark, no newline
+    EXPECT_EQ(lines[0].find("TID"), std::string::npos);
+    EXPECT_EQ(number_in(lines[1], "line "), FLOOD);
+
+    // Told once; the patience is there again.
+    std::thread reader([&] { lines = daemon->take(2000, 500); });
+    log_numbered(0, 500);
+    reader.join();
+    expect_lines(lines, 0, 0, 500);
+}
+
+TEST_P(Syslog, ThreadsShareOnePatience) {
+    const int64_t began = now_ms();
+    std::vector<std::thread> threads;
+    for (int i = 0; i < 4; i++)
+        threads.emplace_back([] { log_numbered(0, FLOOD / 4); });
+    for (std::thread &thread : threads)
+        thread.join();
+    EXPECT_LT(now_ms() - began, COST_MS * 2);
+    int told = 0, got = 0;
+    for (int round = 0; round < 2; round++) {
+        for (const std::string &line : daemon->take()) {
+            const int count = number_in(line, "(count=");
+            told += count > 0 ? count : 0;
+            got += number_in(line, "line ") >= 0;
+        }
+        QV_LOG(LC_LOG_NOTICE, "the last");
+    }
+    EXPECT_EQ(got + told, FLOOD);
+}
+
+TEST_P(Syslog, ADaemonThatComesBackIsFound) {
+    log_numbered(0, 3);
+    daemon->stop();
+    log_numbered(3, 6); // lost, without a word
+    daemon->start();
+    log_numbered(6, 9);
+    expect_lines(daemon->take(), 0, 6, 9);
+    daemon->stop();
+    daemon->start(); // between two lines
+    log_numbered(9, 12);
+    expect_lines(daemon->take(), 0, 9, 12);
+}
+
+TEST_P(Syslog, ADaemonThatStandsStillIsReplaced) {
+    log_numbered(0, FLOOD);
+    log_daemon successor; // the old one still holds its socket
+    log_numbered(0, 3);
+    const std::vector<std::string> lines = successor.take();
+    ASSERT_EQ(lines.size(), 4u);
+    EXPECT_GT(number_in(lines[0], "(count="), 0);
+    expect_lines(lines, 1, 0, 3);
+}
+
+TEST_P(Syslog, WithoutADaemonLinesAreLostCheaply) {
+    daemon->stop();
+    const int64_t began = now_ms();
+    log_numbered(0, 20000);
+    EXPECT_LT(now_ms() - began, 2000);
+    daemon->start();
+    log_numbered(0, 1);
+    expect_lines(daemon->take(), 0, 0, 1);
+}
+
+TEST_P(Syslog, ACancelledThreadLeavesTheLogBehind) {
+    std::atomic<bool> stop{false};
+    std::thread reader([&] {
+        while (!stop)
+            (void)daemon->take(5);
+    });
+    for (int round = 0; round < 100; round++) {
+        pthread_t thread;
+        ASSERT_EQ(pthread_create(
+                      &thread, nullptr,
+                      [](void *) -> void * {
+                          for (;;) {
+                              log_numbered(0, 1);
+                              pthread_testcancel();
+                          }
+                      },
+                      nullptr),
+                  0);
+        usleep(static_cast<useconds_t>(round * 20));
+        pthread_cancel(thread);
+        pthread_join(thread, nullptr);
+    }
+    stop = true;
+    reader.join();
+    (void)daemon->take();
+    log_numbered(5, 6);
+    expect_lines(daemon->take(), 0, 5, 6);
+}
+
+TEST_P(Syslog, AForkedChildCanLog) {
+    std::atomic<bool> stop{false};
+    std::atomic<int> from_children{0};
+    std::thread writer([&] {
+        while (!stop)
+            log_numbered(0, 1);
+    });
+    std::thread reader([&] {
+        while (!stop)
+            for (const std::string &line : daemon->take(5, 50))
+                from_children += line.find("a child") != std::string::npos;
+    });
+    for (int round = 0; round < 30; round++) {
+        const pid_t child = fork();
+        if (child == 0) {
+            alarm(5);
+            QV_LOG(LC_LOG_NOTICE, "a child");
+            _exit(0);
+        }
+        int status = 0;
+        ASSERT_EQ(waitpid(child, &status, 0), child);
+        EXPECT_EQ(status, 0); // and not the alarm
+    }
+    for (int i = 0; i < 100 && from_children < 30; i++)
+        usleep(10000);
+    stop = true;
+    writer.join();
+    reader.join();
+    EXPECT_EQ(from_children, 30);
+}
