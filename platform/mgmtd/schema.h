@@ -1,0 +1,44 @@
+// What may stand in the configuration: one row for each kind of node. "*" in a pattern is a part that the
+// operator chooses. Everything that mgmtd knows of a node, it knows from its row.
+#pragma once
+
+#include <compare>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+// A name by its parts, unescaped. Parts that are numbers are ordered as numbers, so that 2 comes before 10,
+// and before all others.
+struct node_name {
+    std::vector<std::string> parts;
+
+    std::string text() const; // absolute, escaped
+    bool is_under(const node_name &above) const;
+    node_name below(const std::string &part) const;
+    friend bool operator==(const node_name &, const node_name &) = default;
+    friend std::strong_ordering operator<=>(const node_name &a, const node_name &b);
+};
+// False for a name that is relative, has no parts or an empty one.
+bool parse_node_name(const std::string &text, node_name *out);
+
+struct schema_row {
+    const char *pattern;
+    uint32_t type;
+    const char *fallback; // the default, or null: the node is absent then
+    int64_t min, max;     // of a number; of the length of a text; of the number that an instance goes by
+    const char *words;    // of a text, separated by "|"
+    // Further checks: the reason why the text is refused, or null.
+    const char *(*check)(const std::string &text);
+    bool instance; // the node stands for one of many; its value is its own last part, its children need it
+    node_name parts;
+};
+const std::vector<schema_row> &schema();
+const schema_row *find_schema_row(const node_name &name); // null: there is no such node
+bool matches(const node_name &pattern, const node_name &name);
+
+// Brings a value into its one form. False with the reason for a bad one; the reason repeats no password.
+bool check_value(const schema_row &row, const node_name &name, const std::string &text, std::string *out_text,
+                 std::string *out_reason);
+// Text of one type into the form that the type's own conversion gives.
+bool canonical_text(uint32_t type, const std::string &text, std::string *out_text);
+const char *type_name(uint32_t type);
