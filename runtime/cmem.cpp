@@ -267,8 +267,8 @@ static void reset_block(cmem_block *block, const cmem_registry *known, const cha
     memset(block->counters, 0, sizeof block->counters);
     block->diagnostic = 0;
     strlcpy(block->owner, program_invocation_short_name, sizeof block->owner);
-    std::atomic_thread_fence(std::memory_order_release);
-    strlcpy(block->name, name, sizeof block->name);
+    strlcpy(block->name + 1, name + 1, sizeof block->name - 1);
+    __atomic_store_n(&block->name[0], name[0], __ATOMIC_RELEASE);
 }
 
 static void log_double_create(const char *name, int32_t old_pid, int32_t new_pid) {

@@ -179,7 +179,7 @@ TEST_F(Blocks, LinesOfTheConfiguration) {
     std::string conf = "bad 12 normal 1\n  # bad local normal 1\nbad\nworse inter enormous 1\n" +
                        std::string(300, 'b') + " bad local normal 1\n" + longest + "cut local normal 2a\n" +
                        "registry local normal beeffeed\nnokey local normal\nbig local normal 123456789\n"
-                       "words local normal 12x\nat 0 normal 77 10000000000\n";
+                       "words local normal 12x\nat 0 normal 77 300000000000\n";
     for (int i = 0; i < 500; i++)
         conf += "many" + std::to_string(i) + " local normal " + std::to_string(500 + i) + "\n";
     write_conf(conf);
@@ -198,7 +198,7 @@ TEST_F(Blocks, LinesOfTheConfiguration) {
             EXPECT_TRUE(
                 told(std::string("attempt to create shared block ") + name + " conflicts with conf file\n"));
         }
-        EXPECT_EQ(cmem_create_block(1, "at"), reinterpret_cast<void *>(0x10000000000));
+        EXPECT_EQ(cmem_create_block(1, "at"), reinterpret_cast<void *>(0x300000000000));
         EXPECT_NE(cmem_create_block(1, "many300"), nullptr);
         EXPECT_EQ(cmem_create_block(1, "many499"), nullptr); // beyond the table
     });
