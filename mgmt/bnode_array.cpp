@@ -146,7 +146,8 @@ static lc_status begin_walk(pattern_walk *walk, const bn_binding_array *array, c
     CHECK_STATUS(bn_pattern_init(&walk->pattern, pattern));
     walk->array = array;
     walk->next = first;
-    walk->in_order = array->list->sorted && bn_pattern_literal_start(&walk->pattern, &walk->start.pointer);
+    const bool narrowed = bn_pattern_literal_start(&walk->pattern, &walk->start.pointer);
+    walk->in_order = narrowed && array->list->sorted;
     if (!walk->in_order)
         return LC_OK;
     uint32_t low = 0, high = array->list->length; // the first name that is not below the start
@@ -169,9 +170,13 @@ static const bn_binding *next_match(pattern_walk *walk, uint32_t *out_index) {
         if (!binding)
             continue;
         const char *name = binding->name->buffer;
-        if (walk->in_order &&
-            strncmp(name, walk->start.pointer->buffer, static_cast<size_t>(walk->start.pointer->length)) > 0)
+        const int beside = walk->start.pointer ? strncmp(name, walk->start.pointer->buffer,
+                                                         static_cast<size_t>(walk->start.pointer->length))
+                                               : 0;
+        if (walk->in_order && beside > 0)
             return nullptr;
+        if (beside != 0)
+            continue;
         if (!bn_pattern_matches(&walk->pattern, name))
             continue;
         *out_index = index;
