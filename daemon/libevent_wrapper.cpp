@@ -8,9 +8,9 @@
 #include "daemon/libevent_wrapper.h"
 
 #include <cstdlib>
-#include <cstring>
 
 #include "daemon/libevent_loop.h"
+#include "runtime/array.h"
 #include "runtime/logging.h"
 
 struct lew_event {
@@ -22,20 +22,40 @@ struct lew_event {
 
 struct lew {
     loop_context *loop;
-    lew_event ***slots; // sorted by address, each once
-    uint32_t count, capacity;
+    array *slots; // the callers' slots, sorted by address, each once
 };
+
+static void free_slot(void *element) {
+    auto **slot = static_cast<lew_event **>(element);
+    lew_event *event = *slot;
+    *slot = nullptr;
+    if (event)
+        loop_event_free(&event->registered);
+    free(event);
+}
+
+static lc_status init_steps(lew *context) {
+    array_options options;
+    CHECK_STATUS(array_options_get_defaults(&options));
+    options.free = free_slot;
+    options.duplicate_policy = array_dup_refuse;
+    CHECK_STATUS(array_new(&context->slots, &options));
+    context->loop = loop_new();
+    CHECK_CONDITION(context->loop != nullptr);
+    return LC_OK;
+}
 
 lc_status lew_init(lew **out) {
     CHECK_NULL(out);
     *out = nullptr;
     auto *context = static_cast<lew *>(calloc(1, sizeof(lew)));
     CHECK_NULL(context);
-    context->loop = loop_new();
-    if (!context->loop) {
+    const lc_status status = init_steps(context);
+    if (status != LC_OK) {
+        LOG_STATUS(array_free(&context->slots));
         free(context);
-        FAIL_WITH(LC_GENERIC);
     }
+    CHECK_STATUS(status);
     *out = context;
     return LC_OK;
 }
@@ -48,50 +68,12 @@ lc_status lew_get_event_context(lew *context, loop_context **out) {
     return LC_OK;
 }
 
-// The place of a slot, or where it would stand.
-static uint32_t place_of(const lew *context, lew_event **slot, bool *out_found) {
-    uint32_t place = 0;
-    while (place < context->count && context->slots[place] < slot)
-        place++;
-    *out_found = place < context->count && context->slots[place] == slot;
-    return place;
-}
-
 static lc_status find_slot(const lew *context, lew_event **slot, uint32_t *out_place) {
-    bool found;
-    *out_place = place_of(context, slot, &found);
-    return found ? LC_OK : LC_NOT_FOUND;
+    return array_binary_search(context->slots, slot, out_place);
 }
-
 static lc_status add_slot(lew *context, lew_event **slot) {
-    bool found;
-    const uint32_t place = place_of(context, slot, &found);
-    if (found)
-        return LC_EXISTS;
-    if (context->count == context->capacity) {
-        const uint32_t capacity = context->capacity + 10;
-        void *grown = realloc(context->slots, capacity * sizeof *context->slots);
-        CHECK_NULL(grown);
-        context->slots = static_cast<lew_event ***>(grown);
-        context->capacity = capacity;
-    }
-    memmove(context->slots + place + 1, context->slots + place,
-            (context->count - place) * sizeof *context->slots);
-    context->slots[place] = slot;
-    context->count++;
-    return LC_OK;
-}
-
-static void delete_slot(lew *context, uint32_t place) {
-    lew_event **slot = context->slots[place];
-    context->count--;
-    memmove(context->slots + place, context->slots + place + 1,
-            (context->count - place) * sizeof *context->slots);
-    lew_event *event = *slot;
-    *slot = nullptr;
-    if (event)
-        loop_event_free(&event->registered);
-    free(event);
+    void *element = slot;
+    return array_insert_sorted_takeover(context->slots, &element);
 }
 
 static void lew_universal_event_handler(int number, short flags, void *data) {
@@ -134,7 +116,7 @@ lc_status lew_event_reg_signal(lew *context, lew_event **slot, int signal_number
     (*slot)->data = data;
     const lc_status status = loop_event_set_signal((*slot)->registered, signal_number);
     if (status != LC_OK && made && find_slot(context, slot, &place) == LC_OK)
-        delete_slot(context, place);
+        LOG_STATUS(array_delete(context->slots, place));
     CHECK_STATUS(status);
     return LC_OK;
 }
@@ -156,15 +138,15 @@ lc_status lew_event_delete(lew *context, lew_event **slot) {
         return LC_OK;
     uint32_t place;
     CHECK_STATUS(find_slot(context, slot, &place));
-    delete_slot(context, place);
+    CHECK_STATUS(array_delete(context->slots, place));
     return LC_OK;
 }
 
 lc_status lew_delete_all_events(lew *context) {
     CHECK_NULL(context);
     const loop_guard guard(context->loop);
-    while (context->count)
-        delete_slot(context, 0);
+    while (array_length_quick(context->slots))
+        CHECK_STATUS(array_delete(context->slots, 0));
     return LC_OK;
 }
 
@@ -203,7 +185,7 @@ lc_status lew_deinit(lew **inout) {
     if (!context)
         return LC_OK;
     CHECK_STATUS(lew_delete_all_events(context));
-    free(context->slots);
+    CHECK_STATUS(array_free(&context->slots));
     loop_free(&context->loop);
     free(context);
     *inout = nullptr;

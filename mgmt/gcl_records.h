@@ -17,7 +17,7 @@
 constexpr uint32_t GCL_READ_BUFFER_BYTES = 0x20000;
 constexpr uint32_t GCL_READ_ROOM = 0x10000; // least room for a read, and the step by which the buffer grows
 constexpr uint32_t GCL_READ_MAX = 0x100000;
-constexpr uint32_t GCL_READ_BUFFER_KEEP = 0x80000; // an empty buffer that has grown past this is made anew
+constexpr uint32_t GCL_READ_BUFFER_KEEP = 0x40000; // an empty buffer that has grown past this is made anew
 
 struct gcl_frame {
     gcl_frame *next;

@@ -5,7 +5,9 @@
 #include <thread>
 
 #include <gtest/gtest.h>
+#include <netinet/in.h>
 
+#include "mgmt/gcl_records.h"
 #include "tests/support/gcl_client.h"
 #include "tests/support/gcl_log.h"
 
@@ -220,6 +222,30 @@ TEST_F(Gcl, AProviderThatComesLateIsFound) {
     EXPECT_NEAR(now_seconds() - start, 1.5, 0.4);
     EXPECT_EQ(log.count("Could not connect to provider; delaying and retrying."), 1);
     other.join();
+}
+
+TEST_F(Gcl, OverTheInternetProtocol) {
+    gcl_log log;
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t length = sizeof address;
+    auto *generic = reinterpret_cast<sockaddr *>(&address);
+    close(provider.listener);
+    provider.listener = socket(AF_INET, SOCK_STREAM, 0);
+    ASSERT_EQ(bind(provider.listener, generic, length), 0);
+    ASSERT_EQ(listen(provider.listener, 4), 0);
+    ASSERT_EQ(getsockname(provider.listener, generic, &length), 0);
+    ASSERT_EQ(gcl_session_client_new(client.instance, "wccpd", generic, length, &client.session), LC_OK);
+    ASSERT_EQ(gcl_session_client_connect_by_sockaddr(client.session, generic, length, 1), LC_OK);
+    EXPECT_EQ(log.count("connected to 127.0.0.1:" + std::to_string(ntohs(address.sin_port))), 1);
+    std::thread other([&] { EXPECT_TRUE(provider.open_session()); });
+    EXPECT_EQ(client.open(), LC_OK);
+    other.join();
+    gcl_session *session = nullptr;
+    address.sin_family = AF_IPX;
+    EXPECT_EQ(gcl_session_client_new(client.instance, "wccpd", generic, length, &session), LC_GENERIC);
+    EXPECT_EQ(log.count("Unknown af 4"), 1);
 }
 
 // ---- The frame reader
@@ -478,6 +504,22 @@ TEST_F(Gcl, AQueueThatFillsLosesFramesAndSaysSoOnce) {
         other.join();
         EXPECT_EQ(log.count("51 frames were lost"), 1) << filling;
     }
+}
+
+TEST_F(Gcl, ARateLimitSpreadsFramesOverTime) {
+    open();
+    client.session->rate_limit = 100; // kilobytes a second
+    const double start = now_seconds();
+    ASSERT_EQ(client.send(1, wire(50000, 'r')), LC_OK);
+    wire got;
+    std::thread other([&] {
+        got = provider.take_frame();
+        ASSERT_TRUE(provider.put(frame_bytes(3, 1, "done")));
+    });
+    until([&] { return !client.frames.empty(); });
+    other.join();
+    EXPECT_EQ(got, frame_bytes(3, 1, wire(50000, 'r'), 2000003));
+    EXPECT_NEAR(now_seconds() - start, 0.4, 0.2);
 }
 
 TEST_F(Gcl, APeerThatGoesIsFoundByASender) {
