@@ -70,6 +70,7 @@ struct parser {
     node_tree *tree;
     config_comments *comments;
     std::string section; // "" or an absolute name
+    bool skipping;       // the section was refused, and its lines with it
     std::string pending; // comment lines that wait for what they belong to
     std::map<node_name, int> line_of;
 };
@@ -156,7 +157,7 @@ bool config_parse(const std::string &content, const std::string &file, node_tree
     out_tree->set.clear();
     out_comments->before.clear();
     out_errors->clear();
-    parser state{out_tree, out_comments, "", "", {}};
+    parser state{out_tree, out_comments, "", false, "", {}};
     int number = 0;
     for (size_t at = 0; at < content.size();) {
         const size_t end = std::min(content.find('\n', at), content.size());
@@ -166,10 +167,18 @@ bool config_parse(const std::string &content, const std::string &file, node_tree
         std::string reason;
         if (line.empty())
             continue;
-        if (line[0] == '#')
+        if (line[0] == '#') {
             state.pending += line + "\n";
-        else if (line[0] == '[' ? !take_section(&state, line, &reason)
-                                : !take_value(&state, line, number, &reason))
+            continue;
+        }
+        bool good = true;
+        if (line[0] == '[') {
+            good = take_section(&state, line, &reason);
+            state.skipping = !good;
+        } else if (!state.skipping) {
+            good = take_value(&state, line, number, &reason);
+        }
+        if (!good)
             *out_errors += file + ":" + std::to_string(number) + ": " + reason + "\n";
     }
     if (!state.pending.empty())

@@ -1,0 +1,545 @@
+// mgmtd without sockets: what its file may hold, what a commit does and tells, what queries find, and how a
+// state is asked for. Change events are read with the client library that the daemon reads them with.
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "mgmt/bnode_proto.h"
+#include "mgmt/mdc_main.h"
+#include "platform/mgmtd/server.h"
+#include "platform/mgmtd/supervise.h"
+
+static const std::string GROUP = "/qv/wccpd/wccp/srv_grp/config/51";
+static const std::string STATE = "/qv/wccpd/wccp/srv_grp/state";
+
+static node_name named(const std::string &text) {
+    node_name out;
+    EXPECT_TRUE(parse_node_name(text, &out)) << text;
+    return out;
+}
+
+// --- The file
+
+static std::string errors_of(const std::string &content) {
+    node_tree tree;
+    config_comments comments;
+    std::string errors;
+    const bool good = config_parse(content, "F", &tree, &comments, &errors);
+    EXPECT_EQ(good, errors.empty());
+    return errors;
+}
+
+TEST(ConfigFile, EachBadLineIsToldWithItsReason) {
+    const std::string section = "[" + GROUP + "]\n";
+    const struct {
+        std::string content, error;
+    } cases[] = {
+        {"[/qv/wccpd/wccp/srv_grp/config/256]\nweight = 1\n", "F:1: \"256\" is no number between 0 and 255"},
+        {"[/qv/wccpd/wccp/srv_grp/config/051]\n", "F:1: \"051\" is no number between 0 and 255"},
+        {"[/qv/nobody]\n", "F:1: nothing stands below /qv/nobody"},
+        {"[qv/wccpd\n", "F:1: a section is [/name]"},
+        {"weight = 1\n", "F:1: \"weight\" is no name from the root and stands in no section"},
+        {section + "speed = 1\n", "F:2: " + GROUP + "/speed: there is no such node in the configuration"},
+        {section + "weight\n", "F:2: expected [section] or name = value"},
+        {section + "\n# c\nweight = 65536\n",
+         "F:4: " + GROUP + "/weight: \"65536\" is not between 0 and 65535"},
+        {section + "weight = -1\n", "F:2: " + GROUP + "/weight: \"-1\" is no uint32"},
+        {section + "weight =\n", "F:2: " + GROUP + "/weight: \"\" is no uint32"},
+        {section + "hash_src_ip = 1\n", "F:2: " + GROUP + "/hash_src_ip: \"1\" is no bool"},
+        {section + "encap = GRE\n", "F:2: " + GROUP + "/encap: \"GRE\" is none of gre|l2|either"},
+        {section + "protocol = 256\n", "F:2: " + GROUP + "/protocol: \"256\" is not between 1 and 255"},
+        {section + "interface = a-name-too-long1\n",
+         "F:2: " + GROUP + "/interface: \"a-name-too-long1\" is longer than 15 characters"},
+        {section + "router/1/ipaddr = 10.0.0.256\n",
+         "F:2: " + GROUP + "/router/1/ipaddr: \"10.0.0.256\" is no ipv4addr"},
+        {section + "router/33/ipaddr = 10.0.0.1\n",
+         "F:2: " + GROUP + "/router/33/ipaddr: \"33\" is no number between 1 and 32"},
+        {section + "weight = 1\nweight = 2\n", "F:3: " + GROUP + "/weight: was given in line 2 already"},
+        {section + "interface = \"eth0\n", "F:2: " + GROUP + "/interface: the closing quote is missing"},
+        {"/logging/syslog/facility/system = 7\n",
+         "F:1: /logging/syslog/facility/system: \"7\" is no log facility (a multiple of 8 up to 184)"},
+        // What only the whole shows.
+        {section + "router/1/ipaddr = 10.0.0.1\nrouter/3/ipaddr = 10.0.0.3\n",
+         "F:3: " + GROUP + "/router: entries are numbered from 1 without a gap, number 2 is missing"},
+        {section + "router/1/ipaddr = 10.0.0.1\nrouter/2/ipaddr = 10.0.0.1\nweight = 3\n",
+         "F:3: " + GROUP + "/router/2/ipaddr: 10.0.0.1 is given twice"},
+        {section + "mask_src_ip = 0xff\nmask_dst_ip = 0\n",
+         "F:3: " + GROUP + ": the four masks have 8 bits set together, the most is 7"},
+    };
+    for (const auto &one : cases)
+        EXPECT_EQ(errors_of(one.content), one.error + "\n") << one.content;
+    EXPECT_EQ(errors_of(section + "password = 123456789\n").find("123456789"), std::string::npos);
+}
+
+TEST(ConfigFile, WhatIsWrittenReadsTheSameWithItsComments) {
+    const std::string content = "# of the appliance\n"
+                                "[" +
+                                GROUP +
+                                "]\n"
+                                "# slow link\n"
+                                "mask_dst_ip = 0x0f\n"
+                                "password = \" a\\\"b\\\\\"\n"
+                                "router/10/ipaddr = 10.0.0.10\nrouter/9/ipaddr = 10.0.0.9\n"
+                                "[/qv/wccpd/wccp/policy_grp/config/7]\n"
+                                "[/logging/syslog/action/file]\n"
+                                "\\/var\\/log\\/messages/facility/all/min_priority = info\n"
+                                "# the end\n";
+    node_tree tree, again;
+    config_comments comments, comments_again;
+    std::string errors;
+    // Two of ten routers: what is read and written doesn't depend on the whole being sound.
+    EXPECT_FALSE(config_parse(content, "F", &tree, &comments, &errors));
+    const std::string written = config_format(tree, comments);
+    (void)config_parse(written, "F", &again, &comments_again, &errors);
+    EXPECT_EQ(tree.set, again.set) << written;
+    EXPECT_EQ(config_format(again, comments_again), written);
+    EXPECT_EQ(again.set[named(GROUP + "/password")], " a\"b\\");
+    EXPECT_EQ(again.set[named(GROUP + "/mask_dst_ip")], "15");
+    for (const char *line : {"# of the appliance\n[", "# slow link\nmask_dst_ip", "# the end\n"})
+        EXPECT_NE(written.find(line), std::string::npos) << line << "\n" << written;
+    EXPECT_LT(written.find("router/9/"), written.find("router/10/"));
+    EXPECT_EQ(written.find("weight"), std::string::npos) << "a default is not written";
+}
+
+// --- A server whose messages are kept in the place of being sent
+
+namespace {
+struct sent_message {
+    uint32_t peer;
+    uint16_t mtype;
+    bn_request_msg *request = nullptr;
+    bn_response_msg *response = nullptr;
+};
+
+struct Mgmtd : testing::Test {
+    server daemon;
+    int64_t now = 1000;
+    std::vector<sent_message> sent;
+    std::vector<std::string> lines;
+    char file[32] = "/tmp/mgmtd-test-XXXXXX";
+
+    void SetUp() override {
+        ASSERT_TRUE(mkdtemp(file));
+        daemon.config_file = std::string(file) + "/conf";
+        daemon.now_ms = [this] { return now; };
+        daemon.say = [this](const std::string &line) { lines.push_back(line); };
+        daemon.send = [this](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
+            const owned_tbuffer buffer(frame);
+            sent_message message{peer_id, mtype};
+            if (mtype % 2 == 1)
+                ASSERT_EQ(bn_request_msg_deserialize(frame, 32, &message.request), LC_OK);
+            else
+                ASSERT_EQ(bn_response_msg_deserialize(frame, 32, &message.response), LC_OK);
+            sent.push_back(message);
+        };
+        tree_refresh(&daemon.tree);
+        server_peer_opened(&daemon, 1, "wccpd-7"); // the working session
+        server_peer_opened(&daemon, 2, "wccpd-7"); // the alarm session
+        server_peer_opened(&daemon, 3, "mgmtctl-8");
+        action(1, "/mgmtd/events/actions/interest/add",
+               {{"event_name", {bn_type_name, CHANGE_EVENT}},
+                {"match/1/pattern", {bn_type_str, "/qv/wccpd/**"}},
+                {"match/2/pattern", {bn_type_str, "/qv/tunneld/system/config/mode/**"}}});
+        EXPECT_EQ(code(), 0u);
+        clear();
+    }
+    void TearDown() override {
+        clear();
+        (void)!system(("rm -rf " + std::string(file)).c_str());
+    }
+    void clear() {
+        for (sent_message &message : sent) {
+            (void)bn_request_msg_free(&message.request);
+            (void)bn_response_msg_free(&message.response);
+        }
+        sent.clear();
+    }
+    bool give(uint32_t peer_id, bn_request_msg *taken) {
+        const owned_request msg(taken);
+        taken->service_id = 2;
+        if (taken->msg_id == 0)
+            taken->msg_id = 77;
+        owned_tbuffer frame;
+        EXPECT_EQ(bn_request_msg_serialize(taken, 32, &frame.pointer), LC_OK);
+        return server_take_frame(&daemon, peer_id, taken->msg_type, frame.pointer);
+    }
+    void action(uint32_t peer_id, const char *name, const std::vector<event_field> &fields) {
+        bn_request_msg *msg = nullptr;
+        ASSERT_EQ(bn_action_request_msg_create(&msg, name), LC_OK);
+        for (const event_field &field : fields) {
+            bn_binding *binding = make_binding(field.name, field.value);
+            ASSERT_EQ(bn_action_request_msg_append_binding_takeover(msg, 0, &binding, nullptr), LC_OK);
+        }
+        EXPECT_TRUE(give(peer_id, msg));
+    }
+    void query(uint32_t peer_id, const std::string &name, uint32_t subop, uint32_t flags = 0) {
+        bn_request_msg *msg = nullptr;
+        ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), LC_OK);
+        ASSERT_EQ(bn_query_request_msg_append_str(msg, subop, flags, name.c_str(), nullptr), LC_OK);
+        EXPECT_TRUE(give(peer_id, msg));
+    }
+    struct set_node {
+        uint32_t subop;
+        std::string name, value;
+        uint32_t type = bn_type_str;
+    };
+    uint32_t set(const std::vector<set_node> &nodes) {
+        bn_request_msg *msg = nullptr;
+        EXPECT_EQ(bn_set_request_msg_create(&msg, 0), LC_OK);
+        for (const set_node &node : nodes) {
+            bn_binding *binding = make_binding(node.name, {node.type, node.value});
+            EXPECT_EQ(bn_set_request_msg_append_binding_takeover(msg, node.subop, 0, &binding, nullptr),
+                      LC_OK);
+        }
+        clear();
+        EXPECT_TRUE(give(3, msg));
+        return code();
+    }
+    const bn_response_msg *last_response() {
+        for (auto at = sent.rbegin(); at != sent.rend(); ++at)
+            if (at->response)
+                return at->response;
+        return nullptr;
+    }
+    uint32_t code() {
+        const bn_response_msg *response = last_response();
+        return response ? response->return_code : UINT32_MAX;
+    }
+    std::string message() { return ts_str(last_response()->return_message); }
+    // "name=value" of each binding of the last response.
+    std::vector<std::string> found() {
+        std::vector<std::string> out;
+        const bn_response_msg *response = last_response();
+        for (uint32_t i = 0; response && i < bn_response_per_node_array_length_quick(response->nodes); i++) {
+            const bn_binding *binding = bn_response_per_node_array_get_quick(response->nodes, i)->binding;
+            out.push_back(name_of(binding) + "=" + value_of(binding).text);
+        }
+        return out;
+    }
+    // What the daemon makes of the change events that peer 1 was sent: "name=old>new", "-" for none.
+    std::vector<std::string> changes() {
+        std::vector<std::string> out;
+        for (const sent_message &one : sent) {
+            if (one.peer != 1 || one.mtype != bn_msg_event)
+                continue;
+            EXPECT_STREQ(ts_str(one.request->text), CHANGE_EVENT);
+            owned_bindings bindings, old_values, new_values;
+            EXPECT_EQ(bn_request_get(one.request, nullptr, nullptr, 0, &bindings.pointer, nullptr, nullptr),
+                      LC_OK);
+            EXPECT_EQ(mdc_event_config_change_notif_extract(bindings.pointer, &old_values.pointer,
+                                                            &new_values.pointer),
+                      LC_OK);
+            for (uint32_t i = 0; i < bn_binding_array_length_quick(new_values.pointer); i++) {
+                const bn_binding *binding = bn_binding_array_get_quick(new_values.pointer, i);
+                const bn_binding *old_value = nullptr;
+                uint32_t flags = 0;
+                (void)bn_binding_array_get_binding_by_name(old_values.pointer, name_of(binding).c_str(),
+                                                           &old_value);
+                (void)bn_binding_get_type(binding, bn_attrib_value, nullptr, &flags);
+                out.push_back(name_of(binding) + "=" + (old_value ? value_of(old_value).text : "-") + ">" +
+                              (flags & bn_flag_deleted ? "-" : value_of(binding).text));
+            }
+        }
+        return out;
+    }
+};
+} // namespace
+
+using strings = std::vector<std::string>;
+
+static bool has(const strings &list, const std::string &wanted) {
+    return std::find(list.begin(), list.end(), wanted) != list.end();
+}
+
+// --- Commits
+
+TEST_F(Mgmtd, AGroupComesWithItsDefaultsAndGoesWhole) {
+    EXPECT_EQ(set({{bn_set_create, GROUP + "/interface", "eth0"},
+                   {bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"},
+                   {bn_set_create, GROUP + "/weight", "7", bn_type_uint32}}),
+              0u)
+        << message();
+    const strings added = changes();
+    EXPECT_EQ(added.front(), GROUP + "=->51");
+    for (const char *change : {"/interface=->eth0", "/router/1=->1", "/router/1/ipaddr=->10.0.0.1",
+                               "/weight=->7", "/admin=->up", "/password=->", "/mask_dst_ip=->3840"})
+        EXPECT_TRUE(has(added, GROUP + change)) << change;
+    EXPECT_EQ(daemon.tree.revision, 2u);
+    EXPECT_EQ(last_response()->db_revision_id, 2u);
+
+    EXPECT_EQ(set({{bn_set_delete, GROUP, "", bn_type_none}}), 0u) << message();
+    const strings gone = changes();
+    EXPECT_EQ(gone.size(), added.size());
+    EXPECT_TRUE(has(gone, GROUP + "=51>-"));
+    EXPECT_TRUE(has(gone, GROUP + "/admin=up>-"));
+    EXPECT_EQ(set({{bn_set_delete, GROUP, "", bn_type_none}}), static_cast<uint32_t>(LC_NOT_FOUND));
+}
+
+TEST_F(Mgmtd, ADeletedValueFallsBackToItsDefault) {
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/weight", "7"}, {bn_set_create, GROUP + "/policy_grp", "3"}}),
+              0u);
+    EXPECT_EQ(set({{bn_set_delete, GROUP + "/weight", "", bn_type_none}}), 0u);
+    EXPECT_EQ(changes(), strings{GROUP + "/weight=7>100"});
+    EXPECT_EQ(set({{bn_set_delete, GROUP + "/policy_grp", "", bn_type_none}}), 0u);
+    EXPECT_EQ(changes(), strings{GROUP + "/policy_grp=3>-"});
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "100"}}), 0u);
+    EXPECT_EQ(changes(), strings{}) << "what holds already is no change";
+}
+
+TEST_F(Mgmtd, ARefusedStepLeavesEverythingAsItWas) {
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"}}), 0u);
+    const auto before = daemon.tree.set;
+    const struct {
+        set_node bad;
+        lc_status code;
+    } cases[] = {
+        {{bn_set_modify, GROUP + "/weight", "70000"}, LC_BAD_ARGUMENT},
+        {{bn_set_modify, GROUP + "/weight", "1", bn_type_uint16}, LC_BAD_TYPE},
+        {{bn_set_modify, GROUP + "/wait", "1"}, LC_NOT_FOUND},
+        {{bn_set_modify, "/qv/wccpd/wccp/srv_grp/config/52/weight", "1"}, LC_NOT_FOUND},
+        {{bn_set_modify, "weight", "1"}, LC_BAD_PATH},
+        {{bn_set_create, GROUP + "/router/3/ipaddr", "10.0.0.3"}, LC_ASSERTION},
+        {{bn_set_create, GROUP + "/router/2", ""}, LC_ASSERTION}, // no address
+        {{bn_set_delete, GROUP + "/router/1/ipaddr", "", bn_type_none}, LC_ASSERTION},
+        {{bn_set_reparent, GROUP, "", bn_type_none}, LC_NOT_IMPLEMENTED},
+    };
+    for (const auto &one : cases) {
+        EXPECT_EQ(set({{bn_set_modify, GROUP + "/admin", "down"}, one.bad}), static_cast<uint32_t>(one.code))
+            << one.bad.name;
+        EXPECT_FALSE(message().empty()) << one.bad.name;
+        EXPECT_EQ(changes(), strings{});
+        EXPECT_EQ(daemon.tree.set, before) << one.bad.name;
+    }
+}
+
+TEST_F(Mgmtd, EachCommitIsInTheFileBeforeItIsTold) {
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/password", "secret"}}), 0u);
+    struct stat about;
+    ASSERT_EQ(stat(daemon.config_file.c_str(), &about), 0);
+    EXPECT_EQ(about.st_mode & 0777, 0600u);
+    node_tree read_back;
+    config_comments comments;
+    std::string errors;
+    ASSERT_TRUE(config_load(daemon.config_file, &read_back, &comments, &errors)) << errors;
+    EXPECT_EQ(read_back.set, daemon.tree.set);
+
+    daemon.config_file = std::string(file) + "/no/such/directory";
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "9"}}), static_cast<uint32_t>(LC_IO_ERROR));
+    EXPECT_EQ(changes(), strings{});
+    EXPECT_FALSE(daemon.tree.set.contains(named(GROUP + "/weight")));
+}
+
+TEST_F(Mgmtd, AFileEditedByHandIsReadAgainAsOneCommit) {
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/weight", "5"}}), 0u);
+    std::ofstream(daemon.config_file) << "[" << GROUP << "]\nweight = 6\n";
+    clear();
+    server_reload(&daemon);
+    EXPECT_EQ(changes(), strings{GROUP + "/weight=5>6"});
+    std::ofstream(daemon.config_file) << "[" << GROUP << "]\nweight = heavy\n";
+    clear();
+    server_reload(&daemon);
+    EXPECT_EQ(changes(), strings{});
+    EXPECT_EQ(daemon.tree.set[named(GROUP + "/weight")], "6");
+}
+
+TEST_F(Mgmtd, AnInterestHearsWhatItsPatternsName) {
+    EXPECT_EQ(set({{bn_set_modify, "/qv/tunneld/system/config/mode", "bridge"},
+                   {bn_set_modify, "/qv/tunneld/system/config/bonding", "true"}}),
+              0u);
+    EXPECT_EQ(changes(), strings{"/qv/tunneld/system/config/mode=router>bridge"});
+    EXPECT_EQ(set({{bn_set_modify, "/logging/syslog/facility/system", "24"}}), 0u);
+    EXPECT_EQ(changes(), strings{});
+    action(3, "/mgmtd/events/actions/interest/add", {{"match/1/pattern", {bn_type_str, "/a"}}});
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_BAD_ARGUMENT));
+    action(3, "/mgmtd/reboot", {});
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_NOT_FOUND));
+    EXPECT_EQ(message(), "No such action: /mgmtd/reboot");
+}
+
+// --- Queries
+
+TEST_F(Mgmtd, GetAndIterate) {
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"},
+                   {bn_set_create, "/qv/wccpd/wccp/srv_grp/config/7", ""}}),
+              0u);
+    query(1, "/qv/tunneld/system/config/mode", bn_query_get);
+    EXPECT_EQ(found(), strings{"/qv/tunneld/system/config/mode=router"});
+    EXPECT_EQ(last_response()->response_to, 77u);
+    query(1, "/qv/tunneld/system/config/speed", bn_query_get);
+    EXPECT_EQ(found(), strings{});
+    EXPECT_EQ(code(), 0u);
+    const std::string groups = "/qv/wccpd/wccp/srv_grp/config";
+    query(1, groups, bn_query_iterate);
+    EXPECT_EQ(found(), (strings{groups + "/7=7", GROUP + "=51"}));
+    query(1, GROUP + "/router", bn_query_iterate, bn_qf_subtree | bn_qf_include_self);
+    EXPECT_EQ(found(), (strings{GROUP + "/router/1=1", GROUP + "/router/1/ipaddr=10.0.0.1"}));
+    query(1, GROUP + "/router/1", bn_query_iterate, bn_qf_subtree | bn_qf_include_self | bn_qf_leaves_only);
+    EXPECT_EQ(found(), strings{GROUP + "/router/1/ipaddr=10.0.0.1"});
+    query(1, groups, bn_query_iterate, bn_qf_subtree);
+    EXPECT_TRUE(has(found(), groups + "/7/encap=either")) << "defaults of a group's children";
+}
+
+TEST_F(Mgmtd, AStateIsAskedForAndTheAnswerPassedOn) {
+    query(3, STATE + "/51/oper", bn_query_get);
+    ASSERT_EQ(sent.size(), 1u);
+    EXPECT_EQ(sent[0].peer, 1u) << "the working session, not that of the alarms";
+    const bn_request_msg *asked = sent[0].request;
+    ASSERT_NE(asked, nullptr);
+    const uint32_t nodes = bn_request_per_node_array_length_quick(asked->nodes);
+    const bn_request_node *last = bn_request_per_node_array_get_quick(asked->nodes, nodes - 1);
+    EXPECT_EQ(name_of(last->binding), STATE + "/51/oper");
+    EXPECT_EQ(last->subop, static_cast<uint32_t>(bn_query_get));
+    for (uint32_t i = 0; i + 1 < nodes; i++) {
+        const bn_request_node *node = bn_request_per_node_array_get_quick(asked->nodes, i);
+        uint32_t mask = 0;
+        EXPECT_EQ(node->subop, static_cast<uint32_t>(bn_query_registration_info));
+        EXPECT_EQ(bn_binding_get_uint32(node->binding, bn_attrib_capability_mask, nullptr, &mask), LC_OK);
+        EXPECT_NE(mask, 0u);
+    }
+    bn_response_msg *answer = nullptr;
+    ASSERT_EQ(bn_query_response_msg_create(&answer, asked->msg_id, 0, nullptr), LC_OK);
+    const owned_response answer_guard(answer);
+    bn_binding *binding = make_binding(STATE + "/51/oper", {bn_type_str, "ACTIVE"});
+    ASSERT_EQ(bn_query_response_msg_append_binding_takeover(answer, &binding, last->node_id), LC_OK);
+    answer->service_id = 2;
+    owned_tbuffer frame;
+    ASSERT_EQ(bn_response_msg_serialize(answer, 32, &frame.pointer), LC_OK);
+    clear();
+    EXPECT_TRUE(server_take_frame(&daemon, 2, bn_msg_query_response, frame.pointer));
+    EXPECT_TRUE(sent.empty()) << "only who was asked may answer";
+    EXPECT_TRUE(server_take_frame(&daemon, 1, bn_msg_query_response, frame.pointer));
+    ASSERT_EQ(sent.size(), 1u);
+    EXPECT_EQ(sent[0].peer, 3u);
+    EXPECT_EQ(found(), strings{STATE + "/51/oper=ACTIVE"});
+    EXPECT_EQ(last_response()->response_to, 77u);
+    EXPECT_TRUE(server_take_frame(&daemon, 1, bn_msg_query_response, frame.pointer));
+    EXPECT_EQ(sent.size(), 1u) << "an answer counts once";
+}
+
+TEST_F(Mgmtd, AStateThatNobodyGives) {
+    query(3, STATE, bn_query_iterate);
+    EXPECT_EQ(server_tick(&daemon), now + MONITOR_TIMEOUT_MS);
+    now += MONITOR_TIMEOUT_MS;
+    EXPECT_EQ(server_tick(&daemon), -1);
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_IO_TIMED_OUT));
+    // A walk that only comes by has its own nodes to tell.
+    query(3, "/qv/wccpd", bn_query_iterate, bn_qf_subtree);
+    server_peer_closed(&daemon, 1);
+    EXPECT_EQ(code(), 0u);
+    EXPECT_EQ(found(), strings{"/qv/wccpd/system/config/mcast_ttl=1"});
+    query(3, STATE + "/51/oper", bn_query_get);
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_IO_CLOSED));
+    EXPECT_EQ(message(), "wccpd has no session");
+}
+
+// --- Events
+
+TEST_F(Mgmtd, AlarmsStandUntilTheyAreClearedOrTheirSessionEnds) {
+    const auto alarm = [&](const char *event, const char *type) {
+        EXPECT_TRUE(give(2, make_event(std::string("/qv/alarms/events/") + event,
+                                       {{"alarm_type", {bn_type_str, type}},
+                                        {"param_1", {bn_type_str, "0"}},
+                                        {"param_2", {bn_type_str, "0"}},
+                                        {"param_3", {bn_type_str, "eth0:grp:51"}},
+                                        {"comment", {bn_type_str, "down"}}})));
+    };
+    action(3, "/mgmtd/events/actions/interest/add",
+           {{"event_name", {bn_type_name, "/qv/alarms/events/raise_alarm"}}});
+    clear();
+    alarm("raise_alarm", "196638");
+    ASSERT_EQ(sent.size(), 2u);
+    EXPECT_EQ(sent[0].peer, 3u) << "passed on";
+    EXPECT_EQ(sent[1].mtype, bn_msg_event_ack);
+    alarm("raise_alarm", "196639");
+    alarm("raise_alarm", "196639");
+    const std::string raised = "/qv/alarms/state/raised";
+    query(3, raised + "/196638", bn_query_iterate);
+    EXPECT_EQ(found(), strings{raised + "/196638/eth0:grp:51=down"});
+    query(3, raised + "/196638/eth0:grp:51/name", bn_query_get);
+    EXPECT_EQ(found(), strings{raised + "/196638/eth0:grp:51/name=adjacency"});
+    alarm("clear_alarm", "196638");
+    query(3, raised, bn_query_iterate, bn_qf_subtree);
+    EXPECT_EQ(found().size(), 4u);
+    EXPECT_TRUE(give(2, make_event("/qv/state/events/role_change",
+                                   {{"group", {bn_type_str, "51"}}, {"role", {bn_type_uint32, "1"}}})));
+    query(3, "/qv/alarms/state/role/51", bn_query_get);
+    EXPECT_EQ(found(), strings{"/qv/alarms/state/role/51=BACKUP"});
+    server_peer_closed(&daemon, 2);
+    query(3, "/qv/alarms/state", bn_query_iterate, bn_qf_subtree);
+    EXPECT_EQ(found(), strings{});
+    for (size_t i = 0; i < 2 * ALARMS_MAX; i++)
+        EXPECT_TRUE(give(
+            3, make_event("/qv/alarms/events/raise_alarm", {{"param_3", {bn_type_str, std::to_string(i)}}})));
+    EXPECT_EQ(daemon.alarm_owners.size(), ALARMS_MAX);
+}
+
+TEST_F(Mgmtd, TheEndOfAProcessIsToldByItsName) {
+    action(1, "/mgmtd/events/actions/interest/add",
+           {{"event_name", {bn_type_name, "/pm/events/failure/crash"}}});
+    clear();
+    action(3, "/mgmtd/process/actions/report",
+           {{"process_name", {bn_type_str, "tunneld"}}, {"event", {bn_type_str, "crash"}}});
+    ASSERT_EQ(sent.size(), 2u);
+    const std::vector<event_field> fields = fields_of(sent[0].request);
+    EXPECT_EQ(fields[0].value, (node_value{bn_type_str, "tunneld"}));
+    EXPECT_EQ(code(), 0u);
+    action(3, "/mgmtd/process/actions/report", {{"process_name", {bn_type_str, "tunneld"}}});
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_BAD_ARGUMENT));
+}
+
+TEST_F(Mgmtd, AMessageThatIsNoneEndsTheSession) {
+    owned_tbuffer frame;
+    const std::string bytes(200, '\xff');
+    ASSERT_EQ(tb_new_buf(&frame.pointer, bytes.data(), 200), LC_OK);
+    for (uint16_t mtype = 0; mtype < 10; mtype++)
+        EXPECT_FALSE(server_take_frame(&daemon, 3, mtype, frame.pointer)) << mtype;
+}
+
+// --- Supervision
+
+TEST(Supervision, ItStartsAgainLaterAndLaterAndEndsTheLastStartedFirst) {
+    int64_t delay = 0;
+    for (const int64_t expected : {1000, 2000, 4000, 8000, 16000, 30000, 30000})
+        EXPECT_EQ(delay = next_delay(delay, 10), expected);
+    EXPECT_EQ(next_delay(delay, SETTLED_MS), 1000);
+
+    supervisor self;
+    int64_t now = 0;
+    strings told;
+    self.now_ms = [&] { return now; };
+    self.say = [](const std::string &) {};
+    self.tell = [&](const std::string &event, const std::string &process) {
+        told.push_back(process + event);
+    };
+    self.children = {{"first", {"/bin/sleep", "100"}}, {"second", {"/bin/sh", "-c", "kill -9 $$"}}};
+    const auto reap_until = [&](auto done) {
+        for (int i = 0; i < 500 && !done(); i++) {
+            usleep(10000);
+            supervisor_reap(&self);
+        }
+        ASSERT_TRUE(done());
+    };
+    supervisor_tick(&self);
+    reap_until([&] { return self.children[1].pid == 0; });
+    EXPECT_EQ(told, strings{"second/pm/events/failure/crash"});
+    self.children[1].command = {"/bin/sleep", "100"};
+    EXPECT_EQ(supervisor_tick(&self), 1000);
+    now = 1000;
+    EXPECT_EQ(supervisor_tick(&self), -1);
+    EXPECT_NE(self.children[1].pid, 0);
+    self.ending = true;
+    EXPECT_EQ(supervisor_tick(&self), now + END_PATIENCE_MS);
+    reap_until([&] { return self.children[1].pid == 0; });
+    EXPECT_NE(self.children[0].pid, 0);
+    supervisor_tick(&self);
+    reap_until([&] { return supervisor_is_done(self); });
+    EXPECT_EQ(told.size(), 3u);
+    EXPECT_EQ(told[2], "first/pm/events/proc/terminate");
+}
