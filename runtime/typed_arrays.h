@@ -116,87 +116,174 @@ lc_status typed_foreach(Family *list, typed_foreach_function<Family, Element> fu
     return walk_array(list->list, typed_walk<Family, Element>::step, &walk);
 }
 
-// clang-format off
 // `push` is `append` by another name; `release` frees without a status, for owners of a scope.
-#define TYPED_ARRAY_DECLARE(F, E) \
-    struct F { array *list; }; \
-    lc_status F##_new_full(F **out, const array_options *options); \
-    lc_status F##_new(F **out); \
-    lc_status F##_free(F **inout); \
-    lc_status F##_duplicate(const F *list, F **out); \
-    lc_status F##_concat(F *list, F *moved); \
-    int F##_equal(const F *a, const F *b); \
-    lc_status F##_empty(F *list); \
-    lc_status F##_sort(F *list); \
-    lc_status F##_length(const F *list, uint32_t *out_length); \
-    uint32_t F##_length_quick(const F *list); \
-    E F##_get_quick(const F *list, uint32_t index); \
-    lc_status F##_delete(F *list, uint32_t index); \
-    lc_status F##_delete_no_shift(F *list, uint32_t index); \
-    lc_status F##_append(F *list, typed_element<E>::given value); \
-    lc_status F##_append_no_dup(F *list, typed_element<E>::given value); \
-    lc_status F##_push(F *list, typed_element<E>::given value); \
-    lc_status F##_insert_sorted(F *list, typed_element<E>::given value); \
-    lc_status F##_set(F *list, uint32_t index, typed_element<E>::given value); \
-    lc_status F##_insert(F *list, uint32_t index, typed_element<E>::given value); \
-    lc_status F##_insert_sorted_hint(F *list, typed_element<E>::given value, uint32_t hint); \
-    lc_status F##_append_takeover(F *list, E *inout); \
-    lc_status F##_append_no_dup_takeover(F *list, E *inout); \
-    lc_status F##_insert_sorted_takeover(F *list, E *inout); \
-    lc_status F##_set_takeover(F *list, uint32_t index, E *inout); \
-    lc_status F##_insert_takeover(F *list, uint32_t index, E *inout); \
-    lc_status F##_insert_sorted_hint_takeover(F *list, E *inout, uint32_t hint); \
-    lc_status F##_get(const F *list, uint32_t index, E *out); \
-    lc_status F##_remove(F *list, uint32_t index, E *out); \
-    lc_status F##_remove_no_shift(F *list, uint32_t index, E *out); \
-    lc_status F##_peek(const F *list, E *out); \
-    lc_status F##_pop(F *list, E *out); \
-    lc_status F##_binary_search(const F *list, typed_element<E>::given key, uint32_t *out_index); \
-    lc_status F##_best_search(const F *list, typed_element<E>::given key, uint32_t *out_index); \
-    lc_status F##_linear_search(const F *list, typed_element<E>::given key, uint32_t start, uint32_t *out_index); \
-    lc_status F##_foreach(F *list, typed_foreach_function<F, E> function, void *data); \
-    lc_status F##_foreach_delete(F *list, typed_foreach_function<F, E> function, void *data); \
+#define TYPED_ARRAY_DECLARE(F, E)                                                                            \
+    struct F {                                                                                               \
+        array *list;                                                                                         \
+    };                                                                                                       \
+    lc_status F##_new_full(F **out, const array_options *options);                                           \
+    lc_status F##_new(F **out);                                                                              \
+    lc_status F##_free(F **inout);                                                                           \
+    lc_status F##_duplicate(const F *list, F **out);                                                         \
+    lc_status F##_concat(F *list, F *moved);                                                                 \
+    int F##_equal(const F *a, const F *b);                                                                   \
+    lc_status F##_empty(F *list);                                                                            \
+    lc_status F##_sort(F *list);                                                                             \
+    lc_status F##_length(const F *list, uint32_t *out_length);                                               \
+    uint32_t F##_length_quick(const F *list);                                                                \
+    E F##_get_quick(const F *list, uint32_t index);                                                          \
+    lc_status F##_delete(F *list, uint32_t index);                                                           \
+    lc_status F##_delete_no_shift(F *list, uint32_t index);                                                  \
+    lc_status F##_append(F *list, typed_element<E>::given value);                                            \
+    lc_status F##_append_no_dup(F *list, typed_element<E>::given value);                                     \
+    lc_status F##_push(F *list, typed_element<E>::given value);                                              \
+    lc_status F##_insert_sorted(F *list, typed_element<E>::given value);                                     \
+    lc_status F##_set(F *list, uint32_t index, typed_element<E>::given value);                               \
+    lc_status F##_insert(F *list, uint32_t index, typed_element<E>::given value);                            \
+    lc_status F##_insert_sorted_hint(F *list, typed_element<E>::given value, uint32_t hint);                 \
+    lc_status F##_append_takeover(F *list, E *inout);                                                        \
+    lc_status F##_append_no_dup_takeover(F *list, E *inout);                                                 \
+    lc_status F##_insert_sorted_takeover(F *list, E *inout);                                                 \
+    lc_status F##_set_takeover(F *list, uint32_t index, E *inout);                                           \
+    lc_status F##_insert_takeover(F *list, uint32_t index, E *inout);                                        \
+    lc_status F##_insert_sorted_hint_takeover(F *list, E *inout, uint32_t hint);                             \
+    lc_status F##_get(const F *list, uint32_t index, E *out);                                                \
+    lc_status F##_remove(F *list, uint32_t index, E *out);                                                   \
+    lc_status F##_remove_no_shift(F *list, uint32_t index, E *out);                                          \
+    lc_status F##_peek(const F *list, E *out);                                                               \
+    lc_status F##_pop(F *list, E *out);                                                                      \
+    lc_status F##_binary_search(const F *list, typed_element<E>::given key, uint32_t *out_index);            \
+    lc_status F##_best_search(const F *list, typed_element<E>::given key, uint32_t *out_index);              \
+    lc_status F##_linear_search(const F *list, typed_element<E>::given key, uint32_t start,                  \
+                                uint32_t *out_index);                                                        \
+    lc_status F##_foreach(F *list, typed_foreach_function<F, E> function, void *data);                       \
+    lc_status F##_foreach_delete(F *list, typed_foreach_function<F, E> function, void *data);                \
     void F##_release(F *list);
 
-#define TYPED_ARRAY_DEFINE(F, E, fill) \
-    lc_status F##_new_full(F **out, const array_options *options) { return typed_new(out, options); } \
-    lc_status F##_new(F **out) { array_options options; CHECK_STATUS(array_options_get_defaults(&options)); fill(&options); return typed_new(out, &options); } \
-    lc_status F##_free(F **inout) { return typed_free(inout); } \
-    lc_status F##_duplicate(const F *list, F **out) { return typed_duplicate(list, out); } \
-    lc_status F##_concat(F *list, F *moved) { return array_concat(typed_list(list), typed_list(moved)); } \
-    int F##_equal(const F *a, const F *b) { return array_equal(typed_list(a), typed_list(b)); } \
-    lc_status F##_empty(F *list) { return array_empty(typed_list(list)); } \
-    lc_status F##_sort(F *list) { return array_sort(typed_list(list)); } \
-    lc_status F##_length(const F *list, uint32_t *out_length) { return array_length(typed_list(list), out_length); } \
-    uint32_t F##_length_quick(const F *list) { return array_length_quick(typed_list(list)); } \
-    E F##_get_quick(const F *list, uint32_t index) { return typed_element<E>::from_slot(array_get_quick(typed_list(list), index)); } \
-    lc_status F##_delete(F *list, uint32_t index) { return array_delete(typed_list(list), index); } \
-    lc_status F##_delete_no_shift(F *list, uint32_t index) { return array_delete_no_shift(typed_list(list), index); } \
-    lc_status F##_append(F *list, typed_element<E>::given value) { return array_append(typed_list(list), typed_element<E>::to_slot(value)); } \
-    lc_status F##_append_no_dup(F *list, typed_element<E>::given value) { return array_append_no_dup(typed_list(list), typed_element<E>::to_slot(value)); } \
-    lc_status F##_push(F *list, typed_element<E>::given value) { return array_append(typed_list(list), typed_element<E>::to_slot(value)); } \
-    lc_status F##_insert_sorted(F *list, typed_element<E>::given value) { return array_insert_sorted(typed_list(list), typed_element<E>::to_slot(value)); } \
-    lc_status F##_set(F *list, uint32_t index, typed_element<E>::given value) { return array_set(typed_list(list), index, typed_element<E>::to_slot(value)); } \
-    lc_status F##_insert(F *list, uint32_t index, typed_element<E>::given value) { return array_insert(typed_list(list), index, typed_element<E>::to_slot(value)); } \
-    lc_status F##_insert_sorted_hint(F *list, typed_element<E>::given value, uint32_t hint) { return array_insert_sorted_hint(typed_list(list), typed_element<E>::to_slot(value), hint); } \
-    lc_status F##_append_takeover(F *list, E *inout) { return typed_takeover<E>(inout, [&](void **slot) { return array_append_takeover(typed_list(list), slot); }); } \
-    lc_status F##_append_no_dup_takeover(F *list, E *inout) { return typed_takeover<E>(inout, [&](void **slot) { return array_append_no_dup_takeover(typed_list(list), slot); }); } \
-    lc_status F##_insert_sorted_takeover(F *list, E *inout) { return typed_takeover<E>(inout, [&](void **slot) { return array_insert_sorted_takeover(typed_list(list), slot); }); } \
-    lc_status F##_set_takeover(F *list, uint32_t index, E *inout) { return typed_takeover<E>(inout, [&](void **slot) { return array_set_takeover(typed_list(list), index, slot); }); } \
-    lc_status F##_insert_takeover(F *list, uint32_t index, E *inout) { return typed_takeover<E>(inout, [&](void **slot) { return array_insert_takeover(typed_list(list), index, slot); }); } \
-    lc_status F##_insert_sorted_hint_takeover(F *list, E *inout, uint32_t hint) { return typed_takeover<E>(inout, [&](void **slot) { return array_insert_sorted_hint_takeover(typed_list(list), slot, hint); }); } \
-    lc_status F##_get(const F *list, uint32_t index, E *out) { return typed_out<E>(out, [&](void **slot) { return array_get(typed_list(list), index, slot); }); } \
-    lc_status F##_remove(F *list, uint32_t index, E *out) { return typed_out<E>(out, [&](void **slot) { return array_remove(typed_list(list), index, slot); }); } \
-    lc_status F##_remove_no_shift(F *list, uint32_t index, E *out) { return typed_out<E>(out, [&](void **slot) { return array_remove_no_shift(typed_list(list), index, slot); }); } \
-    lc_status F##_peek(const F *list, E *out) { return typed_out<E>(out, [&](void **slot) { return array_peek(typed_list(list), slot); }); } \
-    lc_status F##_pop(F *list, E *out) { return typed_out<E>(out, [&](void **slot) { return array_pop(typed_list(list), slot); }); } \
-    lc_status F##_binary_search(const F *list, typed_element<E>::given key, uint32_t *out_index) { return array_binary_search(typed_list(list), typed_element<E>::to_slot(key), out_index); } \
-    lc_status F##_best_search(const F *list, typed_element<E>::given key, uint32_t *out_index) { return array_best_search(typed_list(list), typed_element<E>::to_slot(key), out_index); } \
-    lc_status F##_linear_search(const F *list, typed_element<E>::given key, uint32_t start, uint32_t *out_index) { return array_linear_search(typed_list(list), typed_element<E>::to_slot(key), start, out_index); } \
-    lc_status F##_foreach(F *list, typed_foreach_function<F, E> function, void *data) { return typed_foreach(list, function, data, array_foreach); } \
-    lc_status F##_foreach_delete(F *list, typed_foreach_function<F, E> function, void *data) { return typed_foreach(list, function, data, array_foreach_delete); } \
-    void F##_release(F *list) { (void)F##_free(&list); }
-// clang-format on
+#define TYPED_ARRAY_DEFINE(F, E, fill)                                                                       \
+    lc_status F##_new_full(F **out, const array_options *options) {                                          \
+        return typed_new(out, options);                                                                      \
+    }                                                                                                        \
+    lc_status F##_new(F **out) {                                                                             \
+        array_options options;                                                                               \
+        CHECK_STATUS(array_options_get_defaults(&options));                                                  \
+        fill(&options);                                                                                      \
+        return typed_new(out, &options);                                                                     \
+    }                                                                                                        \
+    lc_status F##_free(F **inout) {                                                                          \
+        return typed_free(inout);                                                                            \
+    }                                                                                                        \
+    lc_status F##_duplicate(const F *list, F **out) {                                                        \
+        return typed_duplicate(list, out);                                                                   \
+    }                                                                                                        \
+    lc_status F##_concat(F *list, F *moved) {                                                                \
+        return array_concat(typed_list(list), typed_list(moved));                                            \
+    }                                                                                                        \
+    int F##_equal(const F *a, const F *b) {                                                                  \
+        return array_equal(typed_list(a), typed_list(b));                                                    \
+    }                                                                                                        \
+    lc_status F##_empty(F *list) {                                                                           \
+        return array_empty(typed_list(list));                                                                \
+    }                                                                                                        \
+    lc_status F##_sort(F *list) {                                                                            \
+        return array_sort(typed_list(list));                                                                 \
+    }                                                                                                        \
+    lc_status F##_length(const F *list, uint32_t *out_length) {                                              \
+        return array_length(typed_list(list), out_length);                                                   \
+    }                                                                                                        \
+    uint32_t F##_length_quick(const F *list) {                                                               \
+        return array_length_quick(typed_list(list));                                                         \
+    }                                                                                                        \
+    E F##_get_quick(const F *list, uint32_t index) {                                                         \
+        return typed_element<E>::from_slot(array_get_quick(typed_list(list), index));                        \
+    }                                                                                                        \
+    lc_status F##_delete(F *list, uint32_t index) {                                                          \
+        return array_delete(typed_list(list), index);                                                        \
+    }                                                                                                        \
+    lc_status F##_delete_no_shift(F *list, uint32_t index) {                                                 \
+        return array_delete_no_shift(typed_list(list), index);                                               \
+    }                                                                                                        \
+    lc_status F##_append(F *list, typed_element<E>::given value) {                                           \
+        return array_append(typed_list(list), typed_element<E>::to_slot(value));                             \
+    }                                                                                                        \
+    lc_status F##_append_no_dup(F *list, typed_element<E>::given value) {                                    \
+        return array_append_no_dup(typed_list(list), typed_element<E>::to_slot(value));                      \
+    }                                                                                                        \
+    lc_status F##_push(F *list, typed_element<E>::given value) {                                             \
+        return array_append(typed_list(list), typed_element<E>::to_slot(value));                             \
+    }                                                                                                        \
+    lc_status F##_insert_sorted(F *list, typed_element<E>::given value) {                                    \
+        return array_insert_sorted(typed_list(list), typed_element<E>::to_slot(value));                      \
+    }                                                                                                        \
+    lc_status F##_set(F *list, uint32_t index, typed_element<E>::given value) {                              \
+        return array_set(typed_list(list), index, typed_element<E>::to_slot(value));                         \
+    }                                                                                                        \
+    lc_status F##_insert(F *list, uint32_t index, typed_element<E>::given value) {                           \
+        return array_insert(typed_list(list), index, typed_element<E>::to_slot(value));                      \
+    }                                                                                                        \
+    lc_status F##_insert_sorted_hint(F *list, typed_element<E>::given value, uint32_t hint) {                \
+        return array_insert_sorted_hint(typed_list(list), typed_element<E>::to_slot(value), hint);           \
+    }                                                                                                        \
+    lc_status F##_append_takeover(F *list, E *inout) {                                                       \
+        return typed_takeover<E>(                                                                            \
+            inout, [&](void **slot) { return array_append_takeover(typed_list(list), slot); });              \
+    }                                                                                                        \
+    lc_status F##_append_no_dup_takeover(F *list, E *inout) {                                                \
+        return typed_takeover<E>(                                                                            \
+            inout, [&](void **slot) { return array_append_no_dup_takeover(typed_list(list), slot); });       \
+    }                                                                                                        \
+    lc_status F##_insert_sorted_takeover(F *list, E *inout) {                                                \
+        return typed_takeover<E>(                                                                            \
+            inout, [&](void **slot) { return array_insert_sorted_takeover(typed_list(list), slot); });       \
+    }                                                                                                        \
+    lc_status F##_set_takeover(F *list, uint32_t index, E *inout) {                                          \
+        return typed_takeover<E>(                                                                            \
+            inout, [&](void **slot) { return array_set_takeover(typed_list(list), index, slot); });          \
+    }                                                                                                        \
+    lc_status F##_insert_takeover(F *list, uint32_t index, E *inout) {                                       \
+        return typed_takeover<E>(                                                                            \
+            inout, [&](void **slot) { return array_insert_takeover(typed_list(list), index, slot); });       \
+    }                                                                                                        \
+    lc_status F##_insert_sorted_hint_takeover(F *list, E *inout, uint32_t hint) {                            \
+        return typed_takeover<E>(inout, [&](void **slot) {                                                   \
+            return array_insert_sorted_hint_takeover(typed_list(list), slot, hint);                          \
+        });                                                                                                  \
+    }                                                                                                        \
+    lc_status F##_get(const F *list, uint32_t index, E *out) {                                               \
+        return typed_out<E>(out, [&](void **slot) { return array_get(typed_list(list), index, slot); });     \
+    }                                                                                                        \
+    lc_status F##_remove(F *list, uint32_t index, E *out) {                                                  \
+        return typed_out<E>(out, [&](void **slot) { return array_remove(typed_list(list), index, slot); });  \
+    }                                                                                                        \
+    lc_status F##_remove_no_shift(F *list, uint32_t index, E *out) {                                         \
+        return typed_out<E>(                                                                                 \
+            out, [&](void **slot) { return array_remove_no_shift(typed_list(list), index, slot); });         \
+    }                                                                                                        \
+    lc_status F##_peek(const F *list, E *out) {                                                              \
+        return typed_out<E>(out, [&](void **slot) { return array_peek(typed_list(list), slot); });           \
+    }                                                                                                        \
+    lc_status F##_pop(F *list, E *out) {                                                                     \
+        return typed_out<E>(out, [&](void **slot) { return array_pop(typed_list(list), slot); });            \
+    }                                                                                                        \
+    lc_status F##_binary_search(const F *list, typed_element<E>::given key, uint32_t *out_index) {           \
+        return array_binary_search(typed_list(list), typed_element<E>::to_slot(key), out_index);             \
+    }                                                                                                        \
+    lc_status F##_best_search(const F *list, typed_element<E>::given key, uint32_t *out_index) {             \
+        return array_best_search(typed_list(list), typed_element<E>::to_slot(key), out_index);               \
+    }                                                                                                        \
+    lc_status F##_linear_search(const F *list, typed_element<E>::given key, uint32_t start,                  \
+                                uint32_t *out_index) {                                                       \
+        return array_linear_search(typed_list(list), typed_element<E>::to_slot(key), start, out_index);      \
+    }                                                                                                        \
+    lc_status F##_foreach(F *list, typed_foreach_function<F, E> function, void *data) {                      \
+        return typed_foreach(list, function, data, array_foreach);                                           \
+    }                                                                                                        \
+    lc_status F##_foreach_delete(F *list, typed_foreach_function<F, E> function, void *data) {               \
+        return typed_foreach(list, function, data, array_foreach_delete);                                    \
+    }                                                                                                        \
+    void F##_release(F *list) {                                                                              \
+        (void)F##_free(&list);                                                                               \
+    }
 
 // The families of plain numbers.
 #define TYPED_NUMBER_ARRAYS(X)                                                                               \
