@@ -212,6 +212,8 @@ TEST_F(Unload, RefusalsSayWhy) {
         {read_view, view({.appliances = 0x80000000, .elements = {}}), "in ICU pkt."},
         {read_view, view({.appliances = 4, .elements = {three_there[0], three_there[1], three_there[2]}}),
          "WCCP GRP 51: # of appliances (4 x 44 bytes) does not fit in pkt length (0)"},
+        {read_view, view({.appliances = 1, .elements = {wire_bytes().zeros(43)}, .length_error = 1}),
+         "WCCP GRP 51: # of appliances (1 x 44 bytes) does not fit in pkt length (0)"},
         {read_view, view({.appliances = 1, .elements = {hash_element(1, 1)}, .length_error = -1}),
          "WCCP GRP 51: bad length. rxed length 63 pkt length 64 (check compatibility mode (IOS/Nexus))"},
         {read_view, view({.appliances = 1, .elements = {mask_element(1, 2, 1)}}),
