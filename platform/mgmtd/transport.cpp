@@ -33,6 +33,8 @@
 
 static constexpr const char *PROVIDER_NAME = "mgmtd";
 
+static void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken);
+
 // --- The socket
 
 static bool fail(std::string *out_error, const std::string &what) {
@@ -63,6 +65,7 @@ static bool open_directory(transport *self, std::string *out_error) {
 
 bool transport_listen(transport *self, server *owner, std::string *out_error) {
     self->owner = owner;
+    owner->send = [self](uint32_t id, uint16_t mtype, tbuffer *frame) { send_bnode(self, id, mtype, frame); };
     if (!open_directory(self, out_error))
         return false;
     const bool development = getenv("PROD_DEV") != nullptr;
@@ -346,10 +349,6 @@ static void sweep(transport *self) {
 }
 
 bool transport_round(transport *self, int other_fd, int64_t timeout_ms) {
-    if (!self->owner->send)
-        self->owner->send = [self](uint32_t id, uint16_t mtype, tbuffer *frame) {
-            send_bnode(self, id, mtype, frame);
-        };
     for (auto &[id, client] : self->sessions)
         flush(self, &client);
     sweep(self);

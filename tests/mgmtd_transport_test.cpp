@@ -1,0 +1,253 @@
+// The provider's side of sessions, byte by byte: clients here are raw sockets that share no code with it.
+#include <fstream>
+
+#include <gtest/gtest.h>
+
+#include "platform/mgmtd/transport.h"
+#include "tests/support/gcl_provider.h" // wire, be, padded, frame_bytes, number_at
+
+namespace {
+struct raw_client {
+    int fd = -1;
+    wire got;
+    bool closed = false;
+
+    explicit raw_client(bool connected = true) {
+        if (!connected)
+            return;
+        fd = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        strcpy(address.sun_path, "/tmp/gcl-socks/uds-provider-mgmtd");
+        const auto length = static_cast<socklen_t>(strlen(address.sun_path) + 3);
+        EXPECT_EQ(connect(fd, reinterpret_cast<sockaddr *>(&address), length), 0) << strerror(errno);
+    }
+    ~raw_client() {
+        if (fd >= 0)
+            close(fd);
+    }
+    raw_client(const raw_client &) = delete;
+    raw_client &operator=(const raw_client &) = delete;
+    void put(const wire &bytes) const {
+        EXPECT_EQ(send(fd, bytes.data(), bytes.size(), MSG_NOSIGNAL), static_cast<ssize_t>(bytes.size()));
+    }
+    void read_all() {
+        char bytes[65536];
+        ssize_t now;
+        while ((now = recv(fd, bytes, sizeof bytes, 0)) > 0)
+            got.append(bytes, static_cast<size_t>(now));
+        closed = closed || now == 0 || errno == ECONNRESET;
+    }
+    wire take() {
+        if (got.size() < 32 || got.size() < number_at(got, 12))
+            return {};
+        const wire frame = got.substr(0, number_at(got, 12));
+        got.erase(0, frame.size());
+        return frame;
+    }
+};
+
+wire greeting_response(const wire &name, uint32_t uid = geteuid()) {
+    return frame_bytes(1, 2,
+                       be(2, 2) + be(0, 4) + be(0, 4) + be(0, 4) + padded(name, 32) + be(uid, 4) +
+                           be(getegid(), 4) + padded("root", 32) + be(0, 4),
+                       2000001);
+}
+wire open_service(uint32_t service, uint32_t protocol = 2) {
+    return frame_bytes(1, 3, be(5, 4) + be(6, 4) + be(protocol, 4) + be(service, 4) + padded("", 32),
+                       2000002);
+}
+wire text_on_wire(const wire &text) {
+    return be(text.size(), 4) + text;
+}
+// A query with one node, told by its parts.
+wire query_frame(const std::vector<wire> &parts, uint32_t subop, uint32_t flags) {
+    wire body = be(2, 2) + be(1, 2) + be(0, 4) + be(9, 4) + be(10, 4) + text_on_wire("") + be(1, 4) +
+                be(1000, 4) + be(1, 1) + be(parts.size(), 4);
+    for (const wire &part : parts)
+        body += text_on_wire(part);
+    body += be(0, 4) + be(subop, 4) + be(flags, 4) + be(0, 4) + text_on_wire("") + be(0, 4);
+    return frame_bytes(2, 1, body, 2000003);
+}
+
+struct Transport : testing::Test {
+    server daemon;
+    transport sockets;
+    std::vector<std::string> lines;
+
+    void SetUp() override {
+        daemon.now_ms = [] { return int64_t{0}; };
+        daemon.say = [this](const std::string &line) { lines.push_back(line); };
+        tree_refresh(&daemon.tree);
+        std::string error;
+        ASSERT_TRUE(transport_listen(&sockets, &daemon, &error)) << error;
+    }
+    void TearDown() override { transport_close(&sockets); }
+    // Until nothing happens any more.
+    void pump(raw_client *client = nullptr) {
+        for (int quiet = 0; quiet < 3; quiet++) {
+            size_t before = client ? client->got.size() : 0;
+            (void)transport_round(&sockets, -1, 5);
+            if (client)
+                client->read_all();
+            if (client && client->got.size() != before)
+                quiet = 0;
+        }
+    }
+    void open(raw_client *client, const wire &name) {
+        pump(client);
+        client->put(greeting_response(name) + open_service(2));
+        pump(client);
+        EXPECT_FALSE(client->take().empty());
+        EXPECT_FALSE(client->take().empty());
+        EXPECT_EQ(lines.back(), "session of " + name + " open");
+    }
+    wire ask_for_mode(raw_client *client) {
+        client->put(query_frame({"qv", "tunneld", "system", "config", "mode"}, 1, 0));
+        pump(client);
+        return client->take();
+    }
+};
+} // namespace
+
+TEST_F(Transport, OpeningByTheByte) {
+    raw_client client;
+    pump(&client);
+    const wire name = "mgmtd-" + std::to_string(getpid());
+    const wire greeting = client.take();
+    ASSERT_EQ(greeting.size(), 32u + 86u);
+    EXPECT_EQ(greeting.substr(0, 32), wire("GCLF3210") + be(1, 4) + be(118, 4) + be(32, 2) + be(0, 2) +
+                                          be(1000001, 4) + be(1, 2) + be(1, 2) + be(86, 4));
+    EXPECT_EQ(greeting.substr(32, 2), be(2, 2));
+    EXPECT_EQ(greeting.substr(42, 32), padded(name, 32));
+    EXPECT_EQ(number_at(greeting, 74), geteuid());
+    EXPECT_EQ(number_at(greeting, 78), getegid());
+
+    client.put(greeting_response("mgmtctl-5"));
+    client.put(open_service(5));
+    pump(&client);
+    const wire refusal = client.take();
+    EXPECT_EQ(refusal, frame_bytes(1, 4,
+                                   be(1, 4) + be(6, 4) + be(5, 4) + padded("mgmtd", 32) + be(1, 4) +
+                                       be(31, 4) + wire("Bad service id in service open.") + wire(1, '\0'),
+                                   1000002));
+    client.put(open_service(2));
+    pump(&client);
+    const wire granted = client.take();
+    EXPECT_EQ(granted.size(), 32u + 52u);
+    EXPECT_EQ(number_at(granted, 32 + 44), 0u);
+
+    // Byte by byte, and two at once.
+    const wire query = query_frame({"qv", "tunneld", "system", "config", "mode"}, 1, 0);
+    for (const char byte : query) {
+        client.put(wire(1, byte));
+        (void)transport_round(&sockets, -1, 5);
+    }
+    client.put(query + query);
+    pump(&client);
+    const wire response = client.take();
+    const wire body = be(2, 2) + be(2, 2) + be(response.size(), 4) + be(1, 4) + be(10, 4) + be(9, 4) +
+                      be(0, 4) + text_on_wire("") + be(1, 4) + be(1000, 4) + be(1, 1) + be(5, 4) +
+                      text_on_wire("qv") + text_on_wire("tunneld") + text_on_wire("system") +
+                      text_on_wire("config") + text_on_wire("mode") + be(1, 4) + be(4, 4) + be(1, 4) +
+                      be(101, 4) + be(0, 4) + text_on_wire("router") + be(1, 4);
+    EXPECT_EQ(response, frame_bytes(2, 2, body, 1000004));
+    EXPECT_FALSE(client.take().empty());
+    EXPECT_FALSE(client.take().empty());
+    EXPECT_TRUE(client.take().empty());
+}
+
+TEST_F(Transport, WhatCantBeTrueEndsItsSessionAndNoOther) {
+    raw_client bystander;
+    open(&bystander, "wccpd-1");
+    const wire sound = query_frame({"a"}, 1, 0);
+    const auto with_total = [&](uint32_t total) {
+        return sound.substr(0, 12) + be(total, 4) + sound.substr(16);
+    };
+    const struct {
+        const char *what;
+        bool opened;
+        wire bytes;
+    } cases[] = {
+        {"a length of 31", true, with_total(31)},
+        {"a length of 0", true, with_total(0)},
+        {"a length of 4 GiB", true, with_total(UINT32_MAX)},
+        {"another ident", true, "X" + sound.substr(1)},
+        {"another version", true, sound.substr(0, 8) + be(2, 4) + sound.substr(12)},
+        {"a node count without nodes", true,
+         frame_bytes(2, 1, be(2, 2) + be(1, 2) + be(0, 12) + be(0, 4) + be(UINT32_MAX, 4))},
+        {"an unknown protocol", true, frame_bytes(9, 1, "x")},
+        {"a query before the service is open", false, sound},
+        {"a name of no characters", false, greeting_response("")},
+        {"somebody else's user", false, greeting_response("mgmtctl-1", geteuid() + 1)},
+        {"a service before the greeting", false, open_service(2)},
+    };
+    for (const auto &one : cases) {
+        raw_client client;
+        if (one.opened)
+            open(&client, "mgmtctl-2");
+        pump(&client);
+        client.put(one.bytes);
+        pump(&client);
+        EXPECT_TRUE(client.closed) << one.what;
+        EXPECT_EQ(sockets.sessions.size(), 1u) << one.what;
+    }
+    EXPECT_FALSE(ask_for_mode(&bystander).empty());
+}
+
+TEST_F(Transport, AClientThatDoesNotReadLosesItsSessionOnly) {
+    for (int group = 0; group < 256; group++) {
+        const node_name name = {{"qv", "wccpd", "wccp", "srv_grp", "config", std::to_string(group)}};
+        daemon.tree.set[name] = std::to_string(group);
+    }
+    tree_refresh(&daemon.tree);
+    raw_client deaf, bystander;
+    open(&deaf, "wccpd-1");
+    open(&bystander, "wccpd-2");
+    const wire all = query_frame({"qv", "wccpd"}, 2, 0x1000);
+    size_t most = 0;
+    for (int i = 0; i < 100 && sockets.sessions.size() == 2; i++) {
+        (void)send(deaf.fd, all.data(), all.size(), MSG_NOSIGNAL);
+        (void)transport_round(&sockets, -1, 5);
+        for (const auto &[id, client] : sockets.sessions)
+            most = std::max(most, client.queued_bytes);
+        EXPECT_LE(most, QUEUE_MAX_BYTES);
+    }
+    EXPECT_EQ(sockets.sessions.size(), 1u);
+    EXPECT_GT(most, QUEUE_MAX_BYTES / 2);
+    EXPECT_FALSE(ask_for_mode(&bystander).empty());
+}
+
+TEST_F(Transport, TheSocketIsOursAlone) {
+    struct stat about;
+    ASSERT_EQ(stat("/tmp/gcl-socks/uds-provider-mgmtd", &about), 0);
+    EXPECT_EQ(about.st_mode & 07777, 0600u);
+    EXPECT_EQ(about.st_uid, geteuid());
+    ASSERT_EQ(stat("/tmp/gcl-socks", &about), 0);
+    EXPECT_EQ(about.st_mode & 07777, 0755u);
+
+    const auto attempt = [&] {
+        server other;
+        transport second;
+        std::string error;
+        const bool listens = transport_listen(&second, &other, &error);
+        transport_close(&second);
+        return listens ? "listens" : error;
+    };
+    EXPECT_EQ(attempt(), "another mgmtd runs");
+    transport_close(&sockets);
+    EXPECT_NE(stat("/tmp/gcl-socks/uds-provider-mgmtd", &about), 0) << "removed at the end";
+    // Left over from one that was killed.
+    std::ofstream("/tmp/gcl-socks/uds-provider-mgmtd") << "";
+    chmod("/tmp/gcl-socks", 0777);
+    EXPECT_EQ(attempt(), "listens");
+    ASSERT_EQ(stat("/tmp/gcl-socks", &about), 0);
+    EXPECT_EQ(about.st_mode & 07777, 0755u) << "what others could write to is closed";
+    if (chown("/tmp/gcl-socks", 1, 1) == 0) { // not where only one user is known
+        EXPECT_EQ(attempt(), "/tmp/gcl-socks: belongs to user 1, not to us");
+    }
+    ASSERT_EQ(rename("/tmp/gcl-socks", "/tmp/elsewhere"), 0);
+    ASSERT_EQ(symlink("/tmp/elsewhere", "/tmp/gcl-socks"), 0);
+    EXPECT_EQ(attempt(), "/tmp/gcl-socks: Not a directory");
+    unlink("/tmp/gcl-socks");
+}
