@@ -16,8 +16,9 @@ result() { # NAME STATUS
     if [ "$2" = 0 ]; then passed=$((passed + 1)); else failed=$((failed + 1)); bad+=("$1"); fi
 }
 sources() { git ls-files -co --exclude-standard '*.cpp' '*.h'; }
-build() { # PRESET
-    cmake --preset "$1" >"build/$1.log" 2>&1 && cmake --build --preset "$1" -j "$jobs" >>"build/$1.log" 2>&1 ||
+build() { # PRESET [TARGET]
+    cmake --preset "$1" >"build/$1.log" 2>&1 &&
+        cmake --build --preset "$1" -j "$jobs" ${2:+--target "$2"} >>"build/$1.log" 2>&1 ||
         { tail -n 40 "build/$1.log"; return 1; }
 }
 run_ctest() { # PRESET ARGUMENTS...
@@ -40,7 +41,7 @@ for step in "${steps[@]}"; do
     case $step in
     form) sources | xargs clang-format-14 --dry-run --Werror; result "form of the sources" $? ;;
     release | asan) if build "$step"; then run_ctest "$step"; else result "build of $step" 1; fi ;;
-    tsan) if build tsan; then run_ctest tsan -L threads; else result "build of tsan" 1; fi ;;
+    tsan) if build tsan threaded_tests; then run_ctest tsan -L threads; else result "build of tsan" 1; fi ;;
     clang) build clang; result "build with clang" $? ;;
     tidy) cmake --preset clang >/dev/null && sources | grep '\.cpp$' | grep -vE '^(tests|bench|fuzz)/' |
         xargs -P "$jobs" -n 4 clang-tidy-14 --quiet -p build/clang; result "clang-tidy" $? ;;
