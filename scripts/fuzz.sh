@@ -8,10 +8,10 @@ cd "$(dirname "$0")/.." || exit 1
 [ $# -gt 0 ] || { echo "usage: fuzz.sh SECONDS [NAME...]" >&2; exit 2; }
 seconds=$1; shift
 mkdir -p build/fuzz/failures
-{ cmake --preset fuzz && cmake --build --preset fuzz -j "$(nproc)"; } >build/fuzz.log 2>&1 ||
-    { tail -n 40 build/fuzz.log; exit 1; }
 names=("$@")
 [ $# -gt 0 ] || for source in fuzz/*_fuzz.cpp; do names+=("$(basename "$source" .cpp)"); done
+{ cmake --preset fuzz && cmake --build --preset fuzz -j "$(nproc)" --target "${names[@]}"; } >build/fuzz.log 2>&1 ||
+    { tail -n 40 build/fuzz.log; exit 1; }
 status=0
 for name in "${names[@]}"; do
     seeds=build/fuzz/seeds/$name corpus=build/fuzz/corpus/$name
