@@ -70,11 +70,12 @@ static const std::string *text_at(const node_tree &tree, const node_name &name) 
 
 static bool check_routers(const node_tree &tree, const node_name &group, std::string *out_reason) {
     const node_name list = group.below("router");
-    node_map entries;
+    node_list entries;
     collect_nodes(tree.nodes, list, {false, false, false}, &entries);
     std::set<std::string> seen;
     uint32_t expected = 1;
-    for (const auto &[name, value] : entries) {
+    for (const auto *entry : entries) {
+        const auto &[name, value] = *entry;
         if (value.text != std::to_string(expected++)) {
             *out_reason = list.text() + ": entries are numbered from 1 without a gap, number " +
                           std::to_string(expected - 1) + " is missing";
@@ -108,15 +109,15 @@ static bool check_masks(const node_tree &tree, const node_name &group, std::stri
 
 bool tree_check(const node_tree &tree, std::string *out_reason) {
     static const node_name groups = {{"qv", "wccpd", "wccp", "srv_grp", "config"}};
-    node_map roots;
+    node_list roots;
     collect_nodes(tree.nodes, groups, {false, false, false}, &roots);
-    for (const auto &root : roots)
-        if (!check_routers(tree, root.first, out_reason) || !check_masks(tree, root.first, out_reason))
+    for (const auto *root : roots)
+        if (!check_routers(tree, root->first, out_reason) || !check_masks(tree, root->first, out_reason))
             return false;
     return true;
 }
 
-void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk, node_map *out) {
+void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk, node_list *out) {
     for (auto at = nodes.lower_bound(root); at != nodes.end(); ++at) {
         const bool self = at->first == root;
         if (!self && !at->first.is_under(root))
@@ -128,7 +129,7 @@ void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk,
         const auto next = std::next(at);
         if (walk.leaves_only && next != nodes.end() && next->first.is_under(at->first))
             continue;
-        out->insert(*at);
+        out->push_back(&*at);
     }
 }
 

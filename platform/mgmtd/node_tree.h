@@ -31,7 +31,9 @@ bool tree_check(const node_tree &tree, std::string *out_reason);
 struct tree_walk {
     bool subtree, include_self, leaves_only;
 };
-void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk, node_map *out);
+// They are those of `nodes`, in its order.
+using node_list = std::vector<const node_map::value_type *>;
+void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk, node_list *out);
 
 enum class set_kind { create, modify, remove };
 struct set_step {

@@ -89,6 +89,10 @@ struct forwarded {
     uint32_t subop, flags;
     std::string name;
 };
+struct found_node {
+    uint32_t asked_id;
+    const node_map::value_type *node;
+};
 struct query_plan {
     const state_source *source = nullptr;
     std::vector<forwarded> nodes;
@@ -122,11 +126,11 @@ static void plan_node(query_plan *plan, uint32_t node_id, uint32_t subop, uint32
 }
 
 static void answer_here(const server *self, uint32_t subop, uint32_t flags, const node_name &name,
-                        node_map *out) {
+                        node_list *out) {
     for (const node_map *nodes : {&self->tree.nodes, &self->state}) {
         if (subop == bn_query_get) {
             if (const auto found = nodes->find(name); found != nodes->end())
-                out->insert(*found);
+                out->push_back(&*found);
         } else if (subop == bn_query_iterate && !(flags & bn_qf_walk_only)) {
             collect_nodes(*nodes, name,
                           {(flags & bn_qf_subtree) != 0, (flags & bn_qf_include_self) != 0,
@@ -137,7 +141,7 @@ static void answer_here(const server *self, uint32_t subop, uint32_t flags, cons
 }
 
 static bool forward(server *self, uint32_t asker, const bn_request_msg *request, const query_plan &plan,
-                    uint32_t provider, const std::vector<std::pair<uint32_t, event_field>> &answered) {
+                    uint32_t provider, const std::vector<found_node> &answered) {
     owned_request msg;
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK ||
         !append_registrations(msg.pointer, *plan.source))
@@ -148,8 +152,11 @@ static bool forward(server *self, uint32_t asker, const bn_request_msg *request,
                         request->transaction_id,
                         self->now_ms() + MONITOR_TIMEOUT_MS,
                         plan.explicit_node,
-                        answered,
+                        {},
                         {}};
+    for (const found_node &found : answered)
+        query.answered.emplace_back(found.asked_id,
+                                    event_field{found.node->first.text(), found.node->second});
     for (const forwarded &node : plan.nodes) {
         uint32_t node_id = 0;
         if (bn_query_request_msg_append_str(msg.pointer, node.subop, node.flags, node.name.c_str(),
@@ -166,15 +173,16 @@ static bool forward(server *self, uint32_t asker, const bn_request_msg *request,
     return false;
 }
 
-static bool append_answer(bn_response_msg *response, uint32_t node_id, const event_field &field) {
-    owned_binding binding(make_binding(field.name, field.value));
+static bool append_answer(bn_response_msg *response, uint32_t node_id, const std::string &name,
+                          const node_value &value) {
+    owned_binding binding(make_binding(name, value));
     return binding.pointer &&
            bn_query_response_msg_append_binding_takeover(response, &binding.pointer, node_id) == LC_OK;
 }
 
 void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
     query_plan plan;
-    std::vector<std::pair<uint32_t, event_field>> answered;
+    std::vector<found_node> answered;
     const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
     for (uint32_t i = 0; i < count; i++) {
         const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
@@ -182,10 +190,10 @@ void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
         if (!node || !node->binding || !parse_node_name(name_of(node->binding), &name))
             continue;
         plan_node(&plan, node->node_id, node->subop, node->flags, name);
-        node_map found;
+        node_list found;
         answer_here(self, node->subop, node->flags, name, &found);
-        for (const auto &[found_name, value] : found)
-            answered.emplace_back(node->node_id, event_field{found_name.text(), value});
+        for (const auto *entry : found)
+            answered.push_back({node->node_id, entry});
     }
     uint32_t code = 0;
     std::string message;
@@ -201,8 +209,8 @@ void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
     owned_response response;
     if (bn_query_response_msg_create(&response.pointer, msg->msg_id, code, message.c_str()) != LC_OK)
         return;
-    for (const auto &[node_id, field] : answered)
-        if (!append_answer(response.pointer, node_id, field))
+    for (const found_node &found : answered)
+        if (!append_answer(response.pointer, found.asked_id, found.node->first.text(), found.node->second))
             return;
     (void)server_send_response(self, peer_id, response.pointer, msg->transaction_id);
 }
@@ -218,7 +226,7 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
                                      msg->return_message ? ts_str(msg->return_message) : "") != LC_OK)
         return;
     for (const auto &[node_id, field] : query.answered)
-        (void)append_answer(response.pointer, node_id, field);
+        (void)append_answer(response.pointer, node_id, field.name, field.value);
     const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
     for (uint32_t i = 0; i < count; i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);

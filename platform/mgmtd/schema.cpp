@@ -121,10 +121,13 @@ const std::vector<schema_row> &schema() {
 // --- Names
 
 static bool is_number(const std::string &part) {
-    return !part.empty() && part.size() <= 18 && part.find_first_not_of("0123456789") == std::string::npos;
+    return !part.empty() && part.size() <= 18 && part[0] >= '0' && part[0] <= '9' &&
+           part.find_first_not_of("0123456789") == std::string::npos;
 }
 
 static std::strong_ordering compare_parts(const std::string &a, const std::string &b) {
+    if (a == b)
+        return std::strong_ordering::equal;
     if (is_number(a) != is_number(b))
         return is_number(b) <=> is_number(a);
     if (is_number(a))
