@@ -1,0 +1,483 @@
+// The dumps that an operator reads: the whole text of a small group as it has to stand, and every way in
+// which a buffer can be too small for it.
+#include "engine/wccp_debug_utils.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstring>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "runtime/csys.h"
+#include "tests/support/log_lines.h"
+#include "tests/support/reported_group.h"
+
+namespace {
+
+const std::string GLOBAL_TEXT = "\n"
+                                "    WCCP GLOBAL INFO\n"
+                                "\n"
+                                "    WCCP # of groups                 : 1\n"
+                                "    WCCP multicast TTL               : 5\n"
+                                "    WCCP stat num allocs             : 41\n"
+                                "    WCCP stat num frees              : 31\n"
+                                "    WCCP err alloc fails             : 2\n"
+                                "    WCCP # err rx total failures     : 17\n";
+const std::string GROUP_TEXT =
+    "    WCCP appliance ipa               : 10.0.0.1\n"
+    "    WCCP service group (STATE)       : 51 (active)\n"
+    "    WCCP current state up time       : 1:2:3:4\n"
+    "    WCCP protocol                    : 6\n"
+    "    WCCP service flags               : 0x6\n"
+    "    WCCP security option             : 1\n"
+    "    WCCP weight                      : 100\n"
+    "    WCCP priority                    : 240\n"
+    "    WCCP password                    : secret12 0x73, 0x65, 0x63, 0x72, 0x65, 0x74, 0x31, 0x32, \n"
+    "    WCCP admin state                 : enabled\n"
+    "    WCCP configured multicast IP     : 0.0.0.0\n"
+    "    WCCP cfg force L2 return         : 1\n"
+    "    WCCP cfg compatibility mode      : 1 (ios:1 nexus:2)\n"
+    "    WCCP configured interfaces       : 1\n"
+    "    WCCP interfaces                  : # 1 lan0\n"
+    "    WCCP interface ipa and link      : 10.0.0.1 up \n"
+    "    WCCP interface ready flags       : ipa: ok link: no track intf: no \n"
+    "    WCCP configured unicast routers  : # 2\n"
+    "    WCCP configured unicast rtr      : #1 10.0.0.201\n"
+    "    WCCP configured unicast rtr      : #2 10.0.0.202\n"
+    "    WCCP config fwd, assign, return  : gre or L2, hash or mask, gre or L2\n"
+    "    WCCP actual fwd, assign, return  : L2, hash, gre\n"
+    "    WCCP # of view changes           : 7\n"
+    "    WCCP # of transitions (act/ina)  : 3\n"
+    "    WCCP state flags                 : 0x2a = { ACTIVE CAPABILITIES_SET SHUTTING_DOWN  }\n"
+    "    WCCP designated appliance        : yes\n"
+    "    WCCP designated key change #     : 9\n"
+    "    WCCP designated pend. acks       : 1\n"
+    "    WCCP # rtrs redirecting to me    : 4\n"
+    "    WCCP # rmval queries remaining   : 0\n"
+    "    WCCP ICU sending routers         : 1\n"
+    "    ***** WCCP ICU sending router ** : # 1\n"
+    "    WCCP router id (src ip)          : 10.0.0.201 (10.0.0.211)\n"
+    "    WCCP router received id          : 0x12\n"
+    "    WCCP router change number        : 83886080\n"
+    "    WCCP router state flags          : 0x6\n"
+    "    WCCP router connected            : two-way\n"
+    "    WCCP current state up time       : 0:0:1:5\n"
+    "    WCCP router's capabilities       \n"
+    "    WCCP router fwd, assign, return  : L2, INVALID, gre or L2\n"
+    "    WCCP router assignment (RXed)   \n"
+    "    WCCP appliance id                : 10.0.0.1\n"
+    "    WCCP rx buckets assigned/total   : 64/256\n"
+    "    WCCP rx bucket bits 0-127        : 0x04030201 00000000 00000000 00000000\n"
+    "    WCCP rx bucket bits 128-255      : 0x00000000 00000000 00000000 00000080\n"
+    "    WCCP # routers in view           : 1\n"
+    "    WCCP view router id/flags        : 10.0.0.201 0x1\n"
+    "    WCCP # appliances in view        : 1\n"
+    "    WCCP view app.id/weight/flags    : 10.0.0.1 50 0x0\n"
+    "    WCCP ICU sending routers end.\n"
+    "    WCCP # of appliances in view     : 1\n"
+    "    WCCP appliance (sorted w+ip)     : 10.0.0.1 wgt = 100 ref = 2\n"
+    "    WCCP # of routers in view        : 1\n"
+    "    WCCP router view ipa/refcnt      : 10.0.0.201 3\n"
+    "    WCCP raised alarms               : flag: 0x3 adj down, assign tbl mismatch\n"
+    "    WCCP timer router-down alarm     : 12 (seconds)\n"
+    "    WCCP timer assin. mismatch alarm : 0 (seconds)\n";
+const std::string ASSIGNMENT_HEAD = "\n"
+                                    "\tAssignment                \n"
+                                    "\tConfigured HASH            : dst-ip src-port \n"
+                                    "\tConfigured MASK            : src-ip: 0x00001741, src-port: 0x0000 \n"
+                                    "\t                           : dst-ip: 0x00000000, dst-port: 0x0001\n"
+                                    "\tConfigured assign. method  : either\n"
+                                    "\tNegotiated assign. method  : hash\n";
+const std::string HASH_DESIGNATOR = "\n"
+                                    "\tDesignator allocation     \n"
+                                    "\tActive appliances          : 2\n"
+                                    "\tAppliance ip               : 10.0.0.1\n"
+                                    "\tWeight                     : 100\n"
+                                    "\tHash/mask allotment        : 33 % \n"
+                                    "\t                           : 0x00000000 00000000 00000000 00000000\n"
+                                    "\t                           : 0x00000000 001fffff ffffffff ffffffff\n"
+                                    "\n"
+                                    "\tAppliance ip               : 10.0.0.2\n"
+                                    "\tWeight                     : 200\n"
+                                    "\tHash/mask allotment        : 66 % \n"
+                                    "\t                           : 0xffffffff ffffffff ffffffff ffffffff\n"
+                                    "\t                           : 0xffffffff ffe00000 00000000 00000000\n"
+                                    "\n";
+const std::string HASH_ROUTERS = "\tReceived router allocation\n"
+                                 "\tRouter id                  : 10.0.0.201\n"
+                                 "\tAppliance ip               : 10.0.0.1\n"
+                                 "\tWeight                     : 50\n"
+                                 "\tRxed hash bucket allotment : 25 % \n"
+                                 "\tRxed hash assignment       : 0x01020304 00000000 00000000 00000000\n"
+                                 "\t                           : 0x00000000 00000000 00000000 80000000\n"
+                                 "\n"
+                                 "\n";
+const std::string STATS_TEXT = "\n"
+                               "    ********* WCCP GROUP ID 51 STATS ****\n"
+                               "    WCCP # rx icus                   : 1\n"
+                               "    WCCP # rx removal queries        : 2\n"
+                               "    WCCP # tx here_i_am              : 3\n"
+                               "    WCCP # tx redirect assign        : 4\n"
+                               "    WCCP # tx removal query h-i-m    : 5\n"
+                               "    WCCP # alarm router verify sch.  : 6\n"
+                               "    WCCP # alarm assign. verify sch. : 7\n"
+                               "    WCCP # rx unknown capabilities   : 8\n"
+                               "    WCCP # rx err total failures     : 9\n"
+                               "    WCCP # tx err total failures     : 10\n"
+                               "    WCCP # tx err service mismatch   : 11\n"
+                               "    WCCP # rx err authen. mismatch   : 12\n"
+                               "    WCCP # rx err authen. failures   : 13\n";
+const std::string MASK_DESIGNATOR = "\n"
+                                    "\tDesignator allocation     \n"
+                                    "\tActive appliances          : 1\n"
+                                    "\tAppliance ip               : 10.0.0.1\n"
+                                    "\tWeight                     : 100\n"
+                                    "\tHash/mask allotment        : 100 % \n"
+                                    "\n"
+                                    "\tDesignator mask assignment\n"
+                                    "\t      Mask : src-ip     dst-ip     src-port dst-port\n"
+                                    "\t         0 : 0x00000001 0x00001700 0x0000   0x0080\n"
+                                    "\n"
+                                    "\t     Value : src-ip     dst-ip     src-port dst-port appliance ip\n"
+                                    "\t         0 : 0x00000000 0x00000000 0x0000   0x0000   10.0.0.1\n"
+                                    "\t         1 : 0x00000001 0x00001000 0x0002   0x0080   10.0.0.1\n"
+                                    "\n";
+const std::string MASK_ROUTERS = "\tReceived router allocation\n"
+                                 "\tRouter id                  : 10.0.0.201\n"
+                                 "\tAppliance ip               : 10.0.0.1\n"
+                                 "\tWeight                     : 50\n"
+                                 "\tRxed mask value allotment  : 25 % \n"
+                                 "\tRxed value buckets (0-127) : 0x01020304 00000000 00000000 00000000\n"
+                                 "\n"
+                                 "\n";
+
+struct dump {
+    int result;
+    std::string text;
+    uint32_t max;
+};
+
+// The text that `print` writes into a buffer of exactly this size.
+dump dump_of(uint32_t size, const std::function<int(csys_display_buf *)> &print) {
+    const std::unique_ptr<char[]> memory(new char[size]);
+    memset(memory.get(), '~', size);
+    csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.get(), size);
+    const int result = print(buffer);
+    return {result, csys_display_buf_text(buffer), csys_display_buf_bytes_max(buffer)};
+}
+std::string closed(const std::string &text, uint32_t max) {
+    return text + "    (debug buffer: used " + std::to_string(text.size()) + " max len " +
+           std::to_string(max) + ")\n";
+}
+int count_of(const std::string &text, const std::string &part) {
+    int count = 0;
+    for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1))
+        count++;
+    return count;
+}
+
+int print_51(csys_display_buf *buffer) {
+    return wccp_print_service_grp(buffer, 51);
+}
+int print_assignment_51(csys_display_buf *buffer) {
+    return wccp_print_service_grp_assignment_details(51, buffer);
+}
+
+// Group 51 as the texts above have it.
+struct EngineDump : testing::Test {
+    reported_group reported{false};
+    wccp_service_group *group = reported.group;
+    wccp_sending_router *router = add_router(host(201));
+
+    wccp_sending_router *add_router(be32 id) const {
+        auto *made = static_cast<wccp_sending_router *>(wccp_malloc(sizeof(wccp_sending_router)));
+        made->router_id = id;
+        list_push_head(&group->sending_routers, made);
+        group->sending_router_count++;
+        return made;
+    }
+
+    EngineDump() {
+        wccp_g.seconds = 200000;
+        wccp_g.mcast_ttl = 5;
+        reported.interface.link_up = 1;
+        reported.interface.ready_flags = WCCP_IPA_READY;
+        group->state_flags = WCCP_STATE_ACTIVE | WCCP_CAPABILITIES_SET | WCCP_SHUTTING_DOWN;
+        group->state_time = wccp_g.seconds - (86400 + 2 * 3600 + 3 * 60 + 4);
+        group->protocol = 6;
+        group->service_flags = 0x6;
+        group->security_option = 1;
+        group->priority = 240;
+        memcpy(group->password, "secret12", sizeof group->password);
+        group->force_l2_return = 1;
+        group->ucast_routers[0] = host(201);
+        group->ucast_routers[1] = host(202);
+        group->ucast_router_count = 2;
+        group->cfg_fwd_method = WCCP_METHOD_EITHER;
+        group->cfg_assign_method = WCCP_ASSIGN_EITHER;
+        group->fwd_method = WCCP_METHOD_L2;
+        group->assign_method = WCCP_ASSIGN_HASH;
+        group->ret_method = WCCP_METHOD_GRE;
+        group->change_number = 7;
+        group->transitions = 3;
+        group->designated = 1;
+        group->dsg_key_change = 9;
+        group->pending_acks = 1;
+        group->redirecting_routers = 4;
+        group->raised_alarms = WCCP_ALARM_ADJACENCY | WCCP_ALARM_ASSIGNMENT;
+        group->router_alarm_timer = {1, WCCP_TIMER_COUNTS, 1, 30, 12};
+        group->assign_alarm_timer = {0, WCCP_TIMER_COUNTS, 1, 30, 5};
+        uint32_t *const counters[] = {
+            &group->rx_icus,
+            &group->rx_removal_queries,
+            &group->tx_here_i_am,
+            &group->tx_redirect_assign,
+            &group->tx_removal_replies,
+            &group->alarm_router_sched,
+            &group->alarm_assign_sched,
+            &group->rx_unknown_capabilities,
+            &group->rx_failures,
+            &group->tx_failures,
+            &group->rx_service_mismatches,
+            &group->rx_auth_mismatches,
+            &group->rx_auth_failures,
+        };
+        uint32_t value = 1;
+        for (uint32_t *counter : counters)
+            *counter = value++;
+
+        router->src_ipa = host(211);
+        router->receive_id = to_be32(0x12);
+        router->change_number = to_be32(5);
+        router->flags = WCCP_RTR_TWO_WAY | WCCP_RTR_ASSIGN_UNACKED;
+        router->state_time = wccp_g.seconds - 65;
+        router->cap_fwd = 2;
+        router->cap_assign = 4;
+        router->cap_ret = 3;
+        router->view_router_count = router->view_appliance_count = 1;
+        router->view_routers[0] = {host(201), 1};
+        router->view_appliances[0] = {US, 50, 0, 64, 256, {0x01020304, 0, 0, 0, 0, 0, 0, 0x80000000}};
+
+        auto *appliance = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof(wccp_view_appliance)));
+        appliance->ipa = US;
+        appliance->weight = 100;
+        appliance->ref_count = 2;
+        list_push_head(&group->appliance_view, appliance);
+        group->appliance_view_count = 1;
+        auto *seen = static_cast<wccp_view_router *>(wccp_malloc(sizeof(wccp_view_router)));
+        seen->ipa = host(201);
+        seen->ref_count = 3;
+        list_push_head(&group->router_view, seen);
+        group->router_view_count = 1;
+
+        group->mask_src_ip = 0x1741;
+        group->mask_dst_port = 1;
+        group->dsg_appliance_count = group->dsg_active_count = 2;
+        group->dsg_appliances[0] = {US, 1, 100, 85};
+        group->dsg_appliances[1] = {host(2), 1, 200, 171};
+        group->bucket_count = 256;
+        for (uint32_t i = 0; i < WCCP_MAX_BUCKETS; i++)
+            group->bucket_ipa[i] = i < 85 ? US : host(2);
+        wccp_g.stat_allocs = 41;
+        wccp_g.stat_frees = 31;
+        wccp_g.stat_alloc_fails = 2;
+        wccp_g.rx_failures = 17;
+    }
+};
+
+const std::string HASH_TEXT = ASSIGNMENT_HEAD + HASH_DESIGNATOR + HASH_ROUTERS;
+
+TEST_F(EngineDump, TheWholeTextOfOneGroup) {
+    const std::string head = "\n*******   WCCP GROUP 51 INFO START **********\n",
+                      middle = "    ******* WCCP GROUP 51 ASSIGNMENT INFO ******\n",
+                      end = "\n*******   WCCP GROUP 51 INFO END **********\n";
+    const dump one = dump_of(WCCP_DUMP_GROUP_BYTES, print_51);
+    EXPECT_EQ(one.result, 0);
+    EXPECT_EQ(one.text, closed(head + GROUP_TEXT + middle + HASH_TEXT + STATS_TEXT + end, one.max));
+
+    const dump assignment = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51);
+    EXPECT_EQ(assignment.result, 0);
+    EXPECT_EQ(assignment.text, HASH_TEXT);
+    EXPECT_EQ(wccp_print_service_grp_assignment_details(51, nullptr), 1);
+}
+
+TEST_F(EngineDump, AllGroupsAndTheGlobalCounters) {
+    const dump global = dump_of(WCCP_DUMP_GLOBAL_BYTES, wccp_print_global);
+    EXPECT_EQ(global.result, 0);
+    EXPECT_EQ(global.text, closed(GLOBAL_TEXT, global.max));
+
+    const dump all = dump_of(WCCP_DUMP_ALL_BYTES, wccp_print_all_wccp_info);
+    EXPECT_EQ(all.result, 0);
+    EXPECT_EQ(all.text,
+              closed(GLOBAL_TEXT + "\n\n************** WCCP GROUP ID 51 START ************\n" + GROUP_TEXT +
+                         "\n    ******* WCCP GROUP 51 ASSIGNMENT INFO ******\n" + HASH_TEXT + STATS_TEXT +
+                         "************** WCCP GROUP ID 51 END **************\n",
+                     all.max));
+
+    wccp_service_group *const list = wccp_g.group_list;
+    wccp_g.group_list = nullptr;
+    const dump none = dump_of(WCCP_DUMP_ALL_BYTES, wccp_print_all_wccp_info);
+    EXPECT_EQ(none.result, 0);
+    EXPECT_EQ(none.text, closed(GLOBAL_TEXT, none.max));
+    wccp_g.group_list = list;
+}
+
+TEST_F(EngineDump, AGroupThatDoesNotExist) {
+    log_lines log;
+    const dump missing =
+        dump_of(WCCP_DUMP_GROUP_BYTES, [](csys_display_buf *b) { return wccp_print_service_grp(b, 7); });
+    EXPECT_EQ(missing.result, 1);
+    EXPECT_EQ(missing.text, "\n    group 7 does not exist!\n");
+    const dump assignment = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, [](csys_display_buf *b) {
+        return wccp_print_service_grp_assignment_details(7, b);
+    });
+    EXPECT_EQ(assignment.result, 1);
+    EXPECT_EQ(assignment.text, "");
+    EXPECT_NE(log.take().find("WCCP GRP 7: show assignment: cannot find group id 7"), std::string::npos);
+}
+
+TEST_F(EngineDump, WhatTheDesignatorComputed) {
+    // Alone with all buckets.
+    group->dsg_active_count = 1;
+    std::fill(group->bucket_ipa, group->bucket_ipa + WCCP_MAX_BUCKETS, US);
+    const std::string full = "\t                           : 0xffffffff ffffffff ffffffff ffffffff\n";
+    EXPECT_NE(dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text.find(full + full + "\n"),
+              std::string::npos);
+
+    // Masks in place of buckets.
+    group->assign_method = WCCP_ASSIGN_MASK;
+    group->cfg_assign_method = 4;
+    group->dsg_appliances[0].assigned = 2;
+    group->bucket_count = 2;
+    group->mask_in_use = {0x1, 0x1700, 0, 0x80};
+    group->mask_values[0] = {0, 0, 0, 0, US};
+    group->mask_values[1] = {0x1, 0x1000, 2, 0x80, US};
+    group->mask_value_count = 2;
+    std::string head = ASSIGNMENT_HEAD;
+    head.replace(head.find("either"), 6, "unknown");
+    head.replace(head.rfind("hash"), 4, "mask");
+    EXPECT_EQ(dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text,
+              head + MASK_DESIGNATOR + MASK_ROUTERS);
+
+    // Another's computation isn't shown, what the routers report still is; no buckets make no share.
+    group->designated = 0;
+    router->view_appliances[0].buckets_total = 0;
+    std::string shareless = MASK_ROUTERS;
+    shareless.replace(shareless.find("25 %"), 4, "0 %");
+    EXPECT_EQ(dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text,
+              head + "\n\tDesignator allocation      : not the designator \n\n" + shareless);
+
+    // Nothing agreed: neither rows of buckets nor of values.
+    group->assign_method = WCCP_ASSIGN_NONE;
+    const std::string none = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text;
+    EXPECT_NE(none.find("Negotiated assign. method  : not set\n"), std::string::npos);
+    EXPECT_EQ(none.find("Rxed "), std::string::npos);
+}
+
+TEST_F(EngineDump, WordsForOtherStates) {
+    const auto row = [&](const std::string &label) {
+        const std::string text = dump_of(WCCP_DUMP_GROUP_BYTES, print_51).text;
+        const size_t at = text.find("    " + label) + 39;
+        return text.substr(at, text.find('\n', at) - at);
+    };
+    group->admin_state = WCCP_ADMIN_DOWN;
+    EXPECT_EQ(row("WCCP admin state"), "disabled");
+    group->designated = 0;
+    EXPECT_EQ(row("WCCP designated appliance"), "no");
+    group->raised_alarms = 0;
+    EXPECT_EQ(row("WCCP raised alarms"), "none");
+    group->raised_alarms = WCCP_ALARM_ASSIGNMENT;
+    EXPECT_EQ(row("WCCP raised alarms"), "flag: 0x2 assign tbl mismatch");
+    router->flags = WCCP_RTR_ONE_WAY;
+    EXPECT_EQ(row("WCCP router connected"), "one-way");
+    memset(group->password, 0, sizeof group->password);
+    EXPECT_EQ(row("WCCP password"), " 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, ");
+    reported.interface.link_up = 0;
+    EXPECT_EQ(row("WCCP interface ipa and link"), "10.0.0.1 down ");
+    reported.interface.ready_flags = WCCP_LINK_READY;
+    EXPECT_EQ(row("WCCP interface ready flags"), "ipa: no link: ok track intf: no ");
+    wccp_interface primary = {};
+    wccp_g.primary_if = &primary;
+    EXPECT_EQ(row("WCCP interface ready flags"), "ipa: no link: ok track intf: no ");
+    primary.ready_flags = WCCP_ALL_READY;
+    EXPECT_EQ(row("WCCP interface ready flags"), "ipa: no link: ok track intf: ok ");
+    wccp_g.primary_if = nullptr;
+    const char *const states[] = {"none", "init", "active", "bad", "backup", "bad", "bad", "bad"};
+    for (uint32_t bits = 0; bits < 8; bits++) {
+        group->state_flags = bits | WCCP_DESG_ELECT_PENDING;
+        EXPECT_EQ(row("WCCP service group (STATE)"), std::string("51 (") + states[bits] + ")");
+    }
+    EXPECT_EQ(row("WCCP state flags"), "0x17 = { INIT BACKUP ACTIVE DESG_ELECT_PENDING  }");
+}
+
+// However small the buffer: the beginning of the text, closed by a newline, and the result 1.
+TEST_F(EngineDump, EverySizeThatIsTooSmall) {
+    const std::function<int(csys_display_buf *)> prints[] = {wccp_print_global, wccp_print_all_wccp_info,
+                                                             print_51, print_assignment_51};
+    for (const auto &print : prints) {
+        const dump whole = dump_of(WCCP_DUMP_ALL_BYTES, print);
+        ASSERT_EQ(whole.result, 0);
+        const uint32_t overhead = WCCP_DUMP_ALL_BYTES - whole.max;
+        const auto length = static_cast<uint32_t>(whole.text.size());
+        // The closing line is shorter with a smaller buffer: 24 bytes less are surely too few.
+        for (uint32_t max = 1; max < length - 24; max += max + 300 < length ? 23 : 1) {
+            const dump cut = dump_of(max + overhead, print);
+            ASSERT_EQ(cut.result, 1) << max;
+            ASSERT_EQ(cut.text.back(), '\n') << max;
+            ASSERT_LE(cut.text.size(), max);
+            ASSERT_EQ(cut.text.compare(0, cut.text.size() - 1, whole.text, 0, cut.text.size() - 1), 0) << max;
+        }
+    }
+}
+
+TEST_F(EngineDump, WhatTheLogSaysOfAFullBuffer) {
+    log_lines log;
+    const auto said = [&](const std::string &line) { return log.take().find(line) != std::string::npos; };
+    EXPECT_EQ(dump_of(100, wccp_print_global).result, 1);
+    EXPECT_TRUE(said("WCCP: printing global info failed. status (1) length ("));
+    EXPECT_EQ(dump_of(100, wccp_print_all_wccp_info).result, 1);
+    EXPECT_TRUE(said("WCCP: printing global info failed."));
+    EXPECT_EQ(dump_of(600, wccp_print_all_wccp_info).result, 1);
+    EXPECT_TRUE(said("WCCP: print all failed failed. status  (1) length ("));
+    EXPECT_EQ(dump_of(1000, print_51).result, 1);
+    EXPECT_TRUE(said("WCCP: print service group failed failed."));
+    EXPECT_EQ(dump_of(2500, print_51).result, 1);
+    EXPECT_TRUE(said("WCCP: printing sending router failed. status  (1) length ("));
+    EXPECT_EQ(dump_of(100, print_assignment_51).result, 1);
+    const std::string lines = log.take();
+    EXPECT_NE(lines.find("WCCP bail on zero : wccp_print_service_grp_assignment_global "), std::string::npos);
+    EXPECT_NE(lines.find("WCCP: show assignment global failed."), std::string::npos);
+    EXPECT_NE(lines.find("WCCP: show assignment failed failed."), std::string::npos);
+}
+
+TEST_F(EngineDump, ThirtyTwoRoutersWithThirtyTwoAppliances) {
+    while (group->sending_router_count < WCCP_MAX_ROUTERS)
+        add_router(host(10 + group->sending_router_count));
+    for (wccp_sending_router *each = group->sending_routers; each; each = each->next) {
+        each->view_router_count = WCCP_MAX_ROUTERS;
+        each->view_appliance_count = WCCP_MAX_APPLIANCES;
+    }
+    for (const uint32_t method : {WCCP_ASSIGN_HASH, WCCP_ASSIGN_MASK}) {
+        group->assign_method = method;
+        const dump one = dump_of(WCCP_DUMP_GROUP_BYTES, print_51);
+        EXPECT_EQ(one.result, 1);
+        EXPECT_EQ(one.text.size(), one.max);
+        EXPECT_EQ(one.text.back(), '\n');
+        const dump assignment = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51);
+        EXPECT_EQ(assignment.result, 1);
+        EXPECT_EQ(assignment.text.size(), assignment.max);
+        EXPECT_EQ(assignment.text.back(), '\n');
+
+        const dump whole = dump_of(4u << 20, print_51);
+        EXPECT_EQ(whole.result, 0);
+        EXPECT_EQ(count_of(whole.text, "WCCP view app.id/weight/flags"), 1024);
+        EXPECT_EQ(count_of(whole.text, "WCCP view router id/flags"), 1024);
+        EXPECT_EQ(count_of(whole.text, "WCCP rx bucket bits 128-255"), 1024);
+        EXPECT_EQ(count_of(whole.text, "Router id"), 1024);
+        EXPECT_NE(whole.text.find("WCCP ICU sending router ** : # 32\n"), std::string::npos);
+    }
+}
+
+} // namespace
