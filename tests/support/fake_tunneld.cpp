@@ -1,6 +1,9 @@
 #include "tests/support/fake_tunneld.h"
 
+#include <sys/shm.h>
+
 #include <chrono>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 
@@ -67,8 +70,21 @@ std::optional<tunneld_answer> tunneld_is_silent(const seen_command &) {
     return std::nullopt;
 }
 
+// A process makes its block once. A test that starts the engine again plays a new process: the records of the
+// blocks are cleared, the segments stay.
+static void forget_blocks() {
+    constexpr size_t RECORD_BYTES = 336000;
+    const int id = shmget(CMEM_REGISTRY_KEY, 0, 0);
+    void *registry = id >= 0 ? shmat(id, nullptr, 0) : reinterpret_cast<void *>(-1);
+    if (registry == reinterpret_cast<void *>(-1))
+        return;
+    memset(registry, 0, RECORD_BYTES);
+    shmdt(registry);
+}
+
 void write_mem_conf() {
     const std::filesystem::path path = CMEM_CONF_PATH;
     std::filesystem::create_directories(path.parent_path());
     std::ofstream(path) << "# name node pages key\n" << WCCP_MAILBOX_NAME << " local normal 0x51520001\n";
+    forget_blocks();
 }

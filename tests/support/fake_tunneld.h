@@ -53,4 +53,5 @@ std::optional<tunneld_answer> tunneld_does(const seen_command &command);
 std::optional<tunneld_answer> tunneld_is_silent(const seen_command &command);
 
 // The configuration file with the mailbox's line, where wccpd looks for it. Before wccp_init_shmem.
+// Writes the line for the mailbox and lets the process make its block once more.
 void write_mem_conf();
