@@ -346,6 +346,9 @@ TEST_F(Mgmtd, AFileEditedByHandIsReadAgainAsOneCommit) {
     clear();
     server_reload(&daemon);
     EXPECT_EQ(changes(), strings{});
+    unlink(daemon.config_file.c_str());
+    server_reload(&daemon);
+    EXPECT_EQ(changes(), strings{}) << "a file that is gone deletes nothing";
     EXPECT_EQ(daemon.tree.set[named(GROUP + "/weight")], "6");
 }
 

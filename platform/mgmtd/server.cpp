@@ -10,6 +10,10 @@
 #include "platform/mgmtd/server.h"
 
 #include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include <unistd.h>
 
 #include "mgmt/bnode_proto.h"
 
@@ -209,7 +213,10 @@ void server_reload(server *self) {
     node_tree next;
     config_comments comments;
     std::string errors;
-    if (!config_load(self->config_file, &next, &comments, &errors)) {
+    // A file that is gone for a moment is no wish to have everything deleted.
+    if (access(self->config_file.c_str(), R_OK) != 0)
+        errors = self->config_file + ": " + strerror(errno) + "\n";
+    if (!errors.empty() || !config_load(self->config_file, &next, &comments, &errors)) {
         self->say("configuration not read again:\n" + errors);
         return;
     }

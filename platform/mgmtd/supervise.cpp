@@ -16,6 +16,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "runtime/common.h"
+
 int64_t next_delay(int64_t before_ms, int64_t ran_ms) {
     if (before_ms == 0 || ran_ms >= SETTLED_MS)
         return RESTART_DELAY_FIRST_MS;
@@ -29,7 +31,7 @@ const char *end_event(int wait_status, bool ending) {
 }
 
 static std::string end_text(int wait_status) {
-    return WIFSIGNALED(wait_status) ? std::string("killed by ") + strsignal(WTERMSIG(wait_status))
+    return WIFSIGNALED(wait_status) ? std::string("ended by ") + lc_signal_num_to_name(WTERMSIG(wait_status))
                                     : "exited with " + std::to_string(WEXITSTATUS(wait_status));
 }
 

@@ -32,6 +32,7 @@
 #include "mgmt/gcl_wire.h"
 
 static constexpr const char *PROVIDER_NAME = "mgmtd";
+static constexpr int READS_A_TURN = 16; // then the others have theirs
 
 static void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken);
 
@@ -292,7 +293,7 @@ static void take_frames(transport *self, uint32_t id, session *client) {
 
 static void read_session(transport *self, uint32_t id, session *client) {
     char bytes[65536];
-    for (;;) {
+    for (int turns = 0; turns < READS_A_TURN; turns++) {
         const ssize_t got = recv(client->fd, bytes, sizeof bytes, MSG_DONTWAIT);
         if (got < 0 && errno == EINTR)
             continue;
