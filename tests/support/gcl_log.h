@@ -21,6 +21,7 @@ struct gcl_log {
     std::mutex mutex;
     std::vector<std::string> lines;
     std::thread reader;
+    int marks = 0;
 
     gcl_log() {
         fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
@@ -52,15 +53,38 @@ struct gcl_log {
         close(fd);
         unlink("/dev/log");
     }
+    // Datagrams come in order: once the mark has been read, so has everything that was sent before it.
+    void settle() {
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        snprintf(address.sun_path, sizeof address.sun_path, "/dev/log");
+        const std::string mark = "mark " + std::to_string(++marks);
+        const int sender = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+        (void)sendto(sender, mark.data(), mark.size(), 0, reinterpret_cast<sockaddr *>(&address),
+                     sizeof address);
+        close(sender);
+        for (int tries = 0; tries < 10000; tries++) {
+            {
+                const std::lock_guard<std::mutex> guard(mutex);
+                if (!lines.empty() && lines.back() == mark) {
+                    lines.pop_back();
+                    return;
+                }
+                if (std::find(lines.begin(), lines.end(), mark) != lines.end())
+                    return;
+            }
+            usleep(500);
+        }
+    }
     int count(const std::string &part) {
-        usleep(60000); // what was sent has been read by then
+        settle();
         const std::lock_guard<std::mutex> guard(mutex);
         return static_cast<int>(std::count_if(lines.begin(), lines.end(), [&](const std::string &line) {
             return line.find(part) != std::string::npos;
         }));
     }
     void clear() {
-        usleep(60000);
+        settle();
         const std::lock_guard<std::mutex> guard(mutex);
         lines.clear();
     }
