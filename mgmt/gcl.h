@@ -67,7 +67,8 @@ lc_status gcl_session_client_connect_by_sockaddr(gcl_session *session, const soc
                                                  socklen_t length, int retry);
 lc_status gcl_session_client_open_service(gcl_session *session, uint16_t protocol, int32_t service,
                                           const char *name, int32_t reserved);
-// `timeout_ms` -1 waits without limit.
+// `timeout_ms` -1 waits without limit. A wait, as one between attempts to connect, ends with LC_CANCELLED
+// when a signal that ends the process is pending on the calling thread.
 lc_status gcl_session_client_open_service_blocking(gcl_session *session, uint16_t protocol, int32_t service,
                                                    const char *name, int32_t reserved, int64_t timeout_ms);
 lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int stop_on_frames_sent,

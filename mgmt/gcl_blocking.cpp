@@ -1,9 +1,14 @@
 // The opening of a service while the caller waits: a loop over this instance's interests alone, used before
 // the session is in general use. Both locks are held all the time, the wait included.
 //
+// The thread that waits here has its signals blocked, since its loop takes them only in a wait of its own. A
+// peer that never answers must not make the process deaf to the ones that end it: while one of them is
+// pending the wait ends with LC_CANCELLED, and the loop that the caller goes back to takes it.
+//
 // The interests of a round are a copy, and a callback may take away what a later entry of the copy stands
 // for. That does no harm: their functions look at the session, which outlives its interests.
 #include <cerrno>
+#include <csignal>
 #include <cstdlib>
 
 #include <poll.h>
@@ -13,6 +18,7 @@
 #include "runtime/ttime.h"
 
 constexpr int FD_MAX = 0x1ffff;
+constexpr int64_t SIGNAL_LOOK_MS = 500;
 
 // What a caller can wait for a change of.
 struct gcl_watched {
@@ -50,6 +56,16 @@ static bool changed(const gcl_wait *wait, const gcl_watched *before) {
     if (differs)
         LC_LOG(LC_LOG_DEBUG, "CHANGE DETECTED");
     return differs;
+}
+
+bool gcl_end_is_pending() {
+    sigset_t pending;
+    if (sigpending(&pending) != 0)
+        return false;
+    for (const int number : {SIGHUP, SIGINT, SIGTERM})
+        if (sigismember(&pending, number) == 1)
+            return true;
+    return false;
 }
 
 // Milliseconds left, -1 for no limit, -2 when time is up.
@@ -128,6 +144,8 @@ static lc_status run_ready(const gcl_wait *wait, const fdic_event_array *events,
 static lc_status wait_round(gcl_wait *wait, bool *out_stop) {
     if (wait->session->state == GCL_SESSION_CLOSED || wait->session->fd < 0)
         return LC_IO_CLOSED;
+    if (gcl_end_is_pending())
+        return LC_CANCELLED;
     owned<fdic_event_array, fdic_event_array_release> events;
     CHECK_STATUS(fdic_events_query(wait->instance->interests, &events.pointer));
     const gcl_watched before = look(wait);
@@ -140,11 +158,12 @@ static lc_status wait_round(gcl_wait *wait, bool *out_stop) {
     const int64_t left = time_left(wait);
     if (left < -1)
         return LC_IO_TIMED_OUT;
-    const bool for_timer = next_timer >= 0 && (left < 0 || next_timer < left);
-    const int64_t limit = for_timer ? next_timer : left;
-    const int ready = poll(polled.pointer, count, static_cast<int>(limit > INT32_MAX ? INT32_MAX : limit));
+    // No poll is longer than to the next timer or the next look for a signal.
+    const int64_t slice = next_timer >= 0 && next_timer < SIGNAL_LOOK_MS ? next_timer : SIGNAL_LOOK_MS;
+    const bool sliced = left < 0 || slice < left;
+    const int ready = poll(polled.pointer, count, static_cast<int>(sliced ? slice : left));
     if (ready == 0)
-        return for_timer ? LC_OK : LC_IO_TIMED_OUT;
+        return sliced ? LC_OK : LC_IO_TIMED_OUT;
     if (ready < 0 && errno == EINTR)
         return LC_OK;
     if (ready < 0 && errno == EBADF)

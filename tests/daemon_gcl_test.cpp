@@ -1,5 +1,6 @@
 // Sessions against a provider made of raw bytes: the opening, the frame reader, the output queue.
 #include <atomic>
+#include <csignal>
 #include <ctime>
 #include <mutex>
 #include <thread>
@@ -167,6 +168,34 @@ TEST_F(Gcl, APeerThatNeverAnswersOrGoes) {
     EXPECT_EQ(client.open(), LC_IO_CLOSED);
     EXPECT_EQ(gcl_session_close(client.session, 1), LC_OK);
     EXPECT_EQ(client.closes, 1);
+}
+
+// The signals that end the process are blocked in the thread that waits; one that comes ends the wait.
+TEST_F(Gcl, AnOpeningWithoutAnswerEndsWithTheProcess) {
+    sigset_t end;
+    sigemptyset(&end);
+    sigaddset(&end, SIGTERM);
+    ASSERT_EQ(pthread_sigmask(SIG_BLOCK, &end, nullptr), 0);
+    connect();
+    for (const bool opening : {true, false}) {
+        std::thread other([] {
+            usleep(100000);
+            kill(getpid(), SIGTERM);
+        });
+        const double start = now_seconds();
+        if (opening) {
+            EXPECT_EQ(client.open(-1), LC_CANCELLED);
+            EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
+        } else {
+            ASSERT_EQ(client.make(), LC_OK);
+            EXPECT_EQ(gcl_session_client_connect_by_provider(client.session, "nobody", 1), LC_CANCELLED);
+        }
+        EXPECT_LT(now_seconds() - start, 2.5);
+        other.join();
+        int taken = 0;
+        EXPECT_EQ(sigwait(&end, &taken), 0);
+    }
+    ASSERT_EQ(pthread_sigmask(SIG_UNBLOCK, &end, nullptr), 0);
 }
 
 TEST_F(Gcl, ClientNames) {
