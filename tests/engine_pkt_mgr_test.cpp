@@ -407,9 +407,7 @@ TEST_F(Messages, AMapOfAFullPacketIsTakenWhole) {
 }
 
 TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
-    const auto report = [](uint32_t id, uint32_t key) {
-        process(icu(id, view(id, {{100, 100, 0}}, key)));
-    };
+    const auto report = [](uint32_t id, uint32_t key) { process(icu(id, view(id, {{100, 100, 0}}, key))); };
     for (const uint32_t id : {1u, 2u})
         report(id, 0);
     pass_seconds(1);
