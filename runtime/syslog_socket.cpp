@@ -16,6 +16,7 @@
 // One line is made in a buffer of this file, under the log's lock; only a line that is longer allocates.
 #include "runtime/syslog_socket.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstdio>
@@ -35,6 +36,7 @@
 constexpr const char *LOG_PATH = "/dev/log";
 constexpr size_t LINE_BYTES = 4096;
 constexpr int64_t WAIT_STEP_NS = 500000;
+constexpr int64_t LEAST_STEP_NS = 1000; // a wait that finds room each time and no place in it ends as well
 constexpr int64_t SECOND_NS = 1000000000;
 
 // The C library's own mask stands behind a lock which another thread's blocked syslog call may hold.
@@ -101,16 +103,17 @@ static int64_t now_ns() {
     return now.tv_sec * SECOND_NS + now.tv_nsec;
 }
 
-// Waits a step for room, on account of the patience. False when there is none left.
+// Waits a step for room, on account of the patience. False when there is none left. A step counts for no more
+// than its own length: when the machine is so busy that this thread runs late, so does the daemon.
 static bool wait_for_room(syslog_socket *log) {
     if (log->patience_ns <= 0)
         return false;
-    const timespec step = {0, log->patience_ns < WAIT_STEP_NS ? log->patience_ns : WAIT_STEP_NS};
+    const timespec step = {0, WAIT_STEP_NS};
     pollfd writable = {log->fd, POLLOUT, 0};
     const int64_t began = now_ns();
     (void)ppoll(&writable, log->fd >= 0, &step, nullptr);
     const int64_t waited = now_ns() - began;
-    log->patience_ns -= waited > 1000 ? waited : 1000; // a wait that finds room each time ends as well
+    log->patience_ns -= std::clamp<int64_t>(waited, LEAST_STEP_NS, WAIT_STEP_NS);
     return true;
 }
 

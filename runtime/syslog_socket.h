@@ -19,7 +19,7 @@ struct syslog_socket {
     int64_t patience_ns; // waiting that is left until a line gets through again
 };
 
-constexpr int64_t SYSLOG_PATIENCE_NS = 20000000;
+constexpr int64_t SYSLOG_PATIENCE_NS = 30000000;
 
 void syslog_socket_open(syslog_socket *log, const char *ident, bool with_pid, int32_t facility);
 void syslog_socket_close(syslog_socket *log);
