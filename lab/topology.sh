@@ -152,7 +152,8 @@ lab_appliance() { # NAME ADDRESS...
 lab_in() { # NAME COMMAND...
     local node=$1 all=(); shift
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
-    [ -n "${LAB_PID[$node/router]-}" ] || all=(--mount --ipc --pid)
+    # The root as well: the whole lab may run inside a chroot.
+    [ -n "${LAB_PID[$node/router]-}" ] || all=(--mount --root --ipc --pid)
     (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net "${all[@]}" "$@")
 }
 
@@ -161,7 +162,7 @@ lab_start() { # NODE NAME PROGRAM ARGUMENTS...
     local node=$1 name=$2 program=$3; shift 3
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
     case $program in */*) ;; *) program=$WCCP_BIN/$program ;; esac
-    (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net --mount --ipc --pid "$program" "$@") \
+    (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net --mount --root --ipc --pid "$program" "$@") \
         </dev/null >>"$LAB/$node-$name.out" 2>&1 &
     LAB_PID[$node/$name]=$!
 }
