@@ -474,6 +474,7 @@ TEST_F(Threads, AddressesChangeAThousandTimesUnderTheReceivers) {
 // Last, since the library's thread stays for good: the engine's own start, real notifications, and its end.
 TEST_F(Threads, ZTheWholeEngineFollowsTheKernel) {
     const watchdog dog(60s);
+    write_mem_conf(); // the engine starts here as a process of its own
     ASSERT_EQ(wccp_init_mgr(), 0);
     fake_tunneld tunneld(tunneld_does);
     ASSERT_EQ(wccp_g.primary_if, wccp_if_find_interface("wan0"));
