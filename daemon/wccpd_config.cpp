@@ -488,8 +488,11 @@ static lc_status change_facility(const bn_binding *binding) {
     LC_LOG(LC_LOG_INFO, "system facility to %d(%s), %s", static_cast<int>(facility >> 3), name,
            wccpd_program_name);
     (void)lc_log_file(nullptr, "system facility set to %s, %s", name, wccpd_program_name);
+    // Initialising forgets the level that the daemon was given, which has nothing to do with the facility.
+    const int32_t level = lc_log_get_daemon_log_level();
     CHECK_STATUS(lc_log_init(wccpd_program_name, nullptr, 0, WCCPD_LOG_COMPONENT, LC_LOG_DEBUG,
                              static_cast<int32_t>(facility), 1));
+    CHECK_STATUS(lc_log_set_daemon_log_level(level));
     return LC_OK;
 }
 
@@ -571,6 +574,12 @@ static lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_bin
     return LC_OK;
 }
 
+// A walk goes on behind any other failure.
+static lc_status change_or_halt(bn_binding_array *bindings, uint32_t index, bn_binding *binding, void *data) {
+    return wccpd_config_handle_change(bindings, index, binding, data) == LC_OK ? LC_OK
+                                                                               : LC_FOREACH_HALT_ERROR;
+}
+
 // --- The whole, at start and in a change event
 // ----------------------------------------------------------------------
 
@@ -583,7 +592,7 @@ static lc_status query_nodes(const char *root) {
     owned_bindings bindings;
     CHECK_STATUS(query_tree(root, &bindings));
     if (bindings.pointer)
-        CHECK_STATUS(bn_binding_array_foreach(bindings.pointer, wccpd_config_handle_change, nullptr));
+        CHECK_STATUS(bn_binding_array_foreach(bindings.pointer, change_or_halt, nullptr));
     return LC_OK;
 }
 
@@ -614,7 +623,7 @@ lc_status wccpd_config_apply(bn_binding_array *new_values) {
     QV_LOG(LC_LOG_INFO, "WCCP Group config callbacks: %d", static_cast<int>(count));
     if (count != 0)
         return LC_OK;
-    CHECK_STATUS(bn_binding_array_foreach(new_values, wccpd_config_handle_change, nullptr));
+    CHECK_STATUS(bn_binding_array_foreach(new_values, change_or_halt, nullptr));
     QV_LOG(LC_LOG_INFO, "WCCP Modify config complete");
     return LC_OK;
 }
