@@ -1,0 +1,254 @@
+// The monitoring tree over an engine that stands still: every node's type and value, what is listed, and what
+// is answered for that which isn't there.
+#include "daemon/wccpd_monitor.h"
+
+#include <vector>
+
+#include "daemon/wccpd_main.h"
+#include "tests/support/daemon_engine.h"
+
+namespace {
+
+const std::string STATE = "/qv/wccpd/wccp/srv_grp/state";
+const std::string SYSTEM = "/qv/wccpd/system/state/";
+
+be32 address(uint32_t last_octet) {
+    return to_be32(0x0a000000 | last_octet);
+}
+
+struct answer {
+    lc_status status;
+    uint32_t count, type;
+    std::string text;
+    bool operator==(const answer &) const = default;
+};
+void PrintTo(const answer &a, std::ostream *out) {
+    *out << "status " << a.status << ", " << a.count << " of type " << a.type << ": " << a.text;
+}
+const answer NOTHING = {LC_OK, 0, 0, ""};
+
+answer get(const std::string &name) {
+    owner<tstr_array, tstr_array_free> parts;
+    EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
+    binding_list out;
+    answer got = {wccpd_mon_handle_get(name.c_str(), parts, nullptr, out.array),
+                  bn_binding_array_length_quick(out.array), 0, ""};
+    if (got.count == 0)
+        return got;
+    EXPECT_EQ(bn_binding_get_name_quick(out.last()), name);
+    EXPECT_EQ(bn_binding_get_type(out.last(), bn_attrib_value, &got.type, nullptr), LC_OK);
+    got.text = text_of(
+        [&](char **text) { return bn_binding_get_str(out.last(), bn_attrib_value, 0, nullptr, text); });
+    return got;
+}
+answer one(uint32_t type, const std::string &text) {
+    return {LC_OK, 1, type, text};
+}
+
+std::vector<std::string> children(const std::string &name) {
+    owner<tstr_array, tstr_array_free> parts, names;
+    EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
+    EXPECT_EQ(tstr_array_new(&names, nullptr), LC_OK);
+    EXPECT_EQ(wccpd_mon_handle_iterate(name.c_str(), parts, nullptr, names), LC_OK);
+    std::vector<std::string> list;
+    for (uint32_t i = 0; i < tstr_array_length_quick(names); i++)
+        list.push_back(tstr_array_get_str_quick(names, i));
+    return list;
+}
+using names = std::vector<std::string>;
+
+struct DaemonMonitor : testing::Test {
+    daemon_engine engine;
+    wccp_service_group *group = add_group(51);
+
+    static wccp_service_group *add_group(uint8_t id) {
+        wccp_grp_config config = {};
+        config.group_id = id;
+        config.weight = 100;
+        config.compatibility = WCCP_COMPAT_IOS;
+        strcpy(config.interface, "lan0");
+        EXPECT_EQ(wccp_add_group(&config), 0);
+        return wccp_find_group(id);
+    }
+    wccp_sending_router *add_router(uint32_t last_octet) const {
+        auto *router = static_cast<wccp_sending_router *>(wccp_malloc(sizeof(wccp_sending_router)));
+        router->router_id = address(last_octet);
+        router->src_ipa = address(last_octet + 10);
+        router->state_time = wccp_g.seconds;
+        list_push_head(&group->sending_routers, router);
+        group->sending_router_count++;
+        return router;
+    }
+    void add_appliance(uint32_t last_octet, uint16_t weight) const {
+        auto *appliance = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof(wccp_view_appliance)));
+        appliance->ipa = address(last_octet);
+        appliance->weight = weight;
+        list_push_head(&group->appliance_view, appliance);
+        group->appliance_view_count++;
+    }
+    static answer of_51(const std::string &node) { return get(STATE + "/51/" + node); }
+    int said(const std::string &line) { return engine.log.count(line); }
+};
+
+TEST_F(DaemonMonitor, TheGroup) {
+    add_router(201);
+    add_router(202);
+    add_appliance(1, 100);
+    EXPECT_EQ(of_51("oper"), one(bn_type_str, "INIT"));
+    EXPECT_EQ(of_51("uptime"), one(bn_type_duration_ms, "0"));
+    EXPECT_EQ(of_51("app_id"), one(bn_type_str, "10.0.0.1"));
+    EXPECT_EQ(of_51("num_routers"), one(bn_type_uint32, "2"));
+    EXPECT_EQ(of_51("num_appliances"), one(bn_type_uint32, "1"));
+    group->state_flags = WCCP_STATE_ACTIVE;
+    group->designated = 1;
+    wccp_g.seconds = group->state_time + 5000000; // more milliseconds than 32 bits hold
+    EXPECT_EQ(of_51("oper"), one(bn_type_str, "ACTIVE, DESIGNATED"));
+    EXPECT_EQ(of_51("uptime"), one(bn_type_duration_ms, "5000000000"));
+    EXPECT_EQ(get(STATE + "/307/oper"), one(bn_type_str, "ACTIVE, DESIGNATED")); // 51 in eight bits
+    group->designated = 0;
+    group->state_flags = WCCP_STATE_BACKUP;
+    EXPECT_EQ(of_51("oper"), one(bn_type_str, "BACKUP"));
+    group->state_flags = 0;
+    EXPECT_EQ(of_51("oper"), one(bn_type_str, "not-set"));
+}
+
+TEST_F(DaemonMonitor, RoutersAreCountedByTheirPlace) {
+    wccp_sending_router *second = add_router(201);
+    wccp_sending_router *first = add_router(202);
+    first->state_time = wccp_g.seconds - 7;
+    first->flags = WCCP_RTR_TWO_WAY;
+    second->flags = WCCP_RTR_ONE_WAY;
+    EXPECT_EQ(of_51("router/1/id"), one(bn_type_ipv4addr, "10.0.0.202"));
+    EXPECT_EQ(of_51("router/1/ipaddr"), one(bn_type_ipv4addr, "10.0.0.212"));
+    EXPECT_EQ(of_51("router/1/conn_time"), one(bn_type_duration_ms, "7000"));
+    EXPECT_EQ(of_51("router/1/state"), one(bn_type_str, "TWO-WAY connected"));
+    EXPECT_EQ(of_51("router/2/id"), one(bn_type_ipv4addr, "10.0.0.201"));
+    EXPECT_EQ(of_51("router/2/state"), one(bn_type_str, "ONE-WAY connected"));
+    second->flags = 0;
+    EXPECT_EQ(of_51("router/2/state"), one(bn_type_str, "unknown"));
+
+    group->fwd_method = WCCP_METHOD_L2;
+    group->ret_method = WCCP_METHOD_GRE;
+    for (const char *node : {"fwd_method", "ret_method", "assign_method"})
+        EXPECT_EQ(of_51(std::string("router/1/") + node), one(bn_type_str, "not-set"));
+    group->state_flags |= WCCP_CAPABILITIES_SET;
+    EXPECT_EQ(of_51("router/1/fwd_method"), one(bn_type_str, "L2"));
+    EXPECT_EQ(of_51("router/1/ret_method"), one(bn_type_str, "GRE"));
+    EXPECT_EQ(of_51("router/1/assign_method"), one(bn_type_str, "not set"));
+    group->assign_method = WCCP_ASSIGN_MASK;
+    EXPECT_EQ(of_51("router/2/assign_method"), one(bn_type_str, "MASK"));
+
+    // A number that isn't there is answered from nothing.
+    for (const std::string number : {"0", "3", "4294967296"}) {
+        EXPECT_EQ(of_51("router/" + number + "/state"), one(bn_type_str, ""));
+        EXPECT_EQ(of_51("router/" + number + "/id"), one(bn_type_ipv4addr, "0.0.0.0"));
+        EXPECT_EQ(of_51("router/" + number + "/conn_time"), one(bn_type_duration_ms, "0"));
+    }
+}
+
+TEST_F(DaemonMonitor, TheShareOfAnAppliance) {
+    wccp_sending_router *router = add_router(201);
+    router->view_appliance_count = 2;
+    router->view_appliances[0] = {address(1), 100, 0, 85, 256, {}};
+    router->view_appliances[1] = {address(2), 100, 0, 0, 256, {}};
+    EXPECT_EQ(of_51("router/1/appliance/10.0.0.1/load_dist"), one(bn_type_uint32, "33"));
+    EXPECT_EQ(of_51("router/1/appliance/10.0.0.2/load_dist"), one(bn_type_uint32, "0"));
+    router->view_appliances[0].buckets_total = 0;
+    EXPECT_EQ(of_51("router/1/appliance/10.0.0.1/load_dist"), one(bn_type_uint32, "0"));
+    EXPECT_EQ(of_51("router/1/appliance/10.0.0.3/load_dist"), NOTHING);
+    EXPECT_EQ(said("wccp_get_router_appliance_info: failed: status=1"), 1);
+    EXPECT_EQ(of_51("router/2/appliance/10.0.0.1/load_dist"), NOTHING);
+    const answer bad = of_51("router/1/appliance/nobody/load_dist");
+    EXPECT_NE(bad.status, LC_OK);
+    EXPECT_EQ(bad.count, 0u);
+}
+
+TEST_F(DaemonMonitor, AppliancesByNumber) {
+    add_appliance(1, 100);
+    add_appliance(2, 65535);
+    EXPECT_EQ(of_51("appliance/1/ipaddr"), one(bn_type_ipv4addr, "10.0.0.2"));
+    EXPECT_EQ(of_51("appliance/1/weight"), one(bn_type_uint32, "65535"));
+    EXPECT_EQ(of_51("appliance/2/ipaddr"), one(bn_type_ipv4addr, "10.0.0.1"));
+    EXPECT_EQ(of_51("appliance/3/ipaddr"), one(bn_type_ipv4addr, "0.0.0.0"));
+    EXPECT_EQ(of_51("appliance/3/weight"), one(bn_type_uint32, "0"));
+    EXPECT_EQ(children(STATE + "/51/appliance"), names{});
+}
+
+TEST_F(DaemonMonitor, NodesThatOnlyStandForTheirChildren) {
+    EXPECT_EQ(get(STATE + "/7"), one(bn_type_str, "7"));
+    EXPECT_EQ(get(STATE + "/51"), one(bn_type_str, "51"));
+    EXPECT_EQ(get(STATE + "/7/router/99"), one(bn_type_str, "99"));
+    EXPECT_EQ(get(STATE + "/7/router/1/appliance/10.0.0.9"), one(bn_type_str, "10.0.0.9"));
+    EXPECT_EQ(said("cannot find group"), 0); // the engine isn't asked
+}
+
+TEST_F(DaemonMonitor, WhatIsNotThere) {
+    EXPECT_EQ(get(STATE + "/7/oper"), NOTHING);
+    EXPECT_EQ(get(STATE + "/7/debug"), NOTHING);
+    EXPECT_EQ(get(STATE + "/7/appliance/1/weight"), NOTHING);
+    EXPECT_EQ(said("wccp_get_grp_info failed: 1"), 3);
+    const answer router = get(STATE + "/7/router/1/state");
+    EXPECT_EQ(router, (answer{1, 0, 0, ""}));
+    EXPECT_EQ(of_51("colour"), NOTHING);
+    EXPECT_EQ(of_51("router/1/colour"), NOTHING);
+    EXPECT_EQ(of_51("oper/deeper"), NOTHING);
+    EXPECT_EQ(get(SYSTEM + "colour"), NOTHING);
+    EXPECT_EQ(get("/qv/tunneld/system/state/proto_ver"), NOTHING);
+    EXPECT_EQ(said("MonGet not for wccpd, bailing - /qv/tunneld/system/state/proto_ver"), 1);
+    EXPECT_EQ(said("MonGet: last_name_part=deeper"), 1);
+}
+
+TEST_F(DaemonMonitor, TheProgramItself) {
+    EXPECT_EQ(get(SYSTEM + "proto_ver"), one(bn_type_str, "2.0"));
+    EXPECT_EQ(get(SYSTEM + "is_alive"), one(bn_type_str, "Initializing"));
+    m_daemon_status = WCCPD_READY;
+    EXPECT_EQ(get(SYSTEM + "is_alive"), one(bn_type_str, "Ready"));
+    m_daemon_status = WCCPD_INITIALIZING;
+}
+
+TEST_F(DaemonMonitor, TheTexts) {
+    const auto holds = [](const answer &got, const std::string &part) {
+        return got.count == 1 && got.type == bn_type_str && got.text.find(part) != std::string::npos;
+    };
+    EXPECT_TRUE(holds(get(SYSTEM + "debug_global"), "    WCCP # of groups                 : 1\n"));
+    EXPECT_TRUE(holds(get(SYSTEM + "debug_all"), "WCCP GROUP ID 51 END"));
+    EXPECT_TRUE(holds(of_51("debug"), "WCCP GROUP 51 INFO END"));
+    EXPECT_TRUE(holds(of_51("assignment"), "Received router allocation"));
+
+    // Too long: the group's own text comes cut, the others don't come, and nothing fails.
+    while (group->sending_router_count < WCCP_MAX_ROUTERS) {
+        wccp_sending_router *router = add_router(group->sending_router_count + 20);
+        router->view_appliance_count = WCCP_MAX_APPLIANCES;
+    }
+    const answer cut = of_51("debug");
+    EXPECT_TRUE(holds(cut, "WCCP GROUP 51 INFO START"));
+    EXPECT_GT(cut.text.size(), 16000u);
+    EXPECT_LT(cut.text.size(), 16384u);
+    EXPECT_EQ(cut.text.back(), '\n');
+    EXPECT_EQ(of_51("assignment"), NOTHING);
+    EXPECT_EQ(get(SYSTEM + "debug_all"), NOTHING);
+    EXPECT_TRUE(holds(get(SYSTEM + "debug_global"), "debug buffer: used"));
+}
+
+TEST_F(DaemonMonitor, WhatIsListed) {
+    add_group(200);
+    add_group(0);
+    wccp_sending_router *second = add_router(201);
+    add_router(202);
+    second->view_appliance_count = 2;
+    second->view_appliances[0].ipa = address(9);
+    second->view_appliances[1].ipa = address(1);
+    EXPECT_EQ(children(STATE), (names{"0", "51", "200"}));
+    EXPECT_EQ(children(STATE + "/51/router"), (names{"1", "2"}));
+    EXPECT_EQ(children(STATE + "/51/router/2/appliance"), (names{"10.0.0.9", "10.0.0.1"}));
+    EXPECT_EQ(children(STATE + "/51/router/1/appliance"), names{});
+    EXPECT_EQ(children(STATE + "/200/router"), names{});
+    EXPECT_EQ(children(STATE + "/51"), names{});
+    EXPECT_EQ(children(STATE + "/7/router"), names{});
+    EXPECT_EQ(said("wccp_get_router_list: failed: status=1"), 1);
+    EXPECT_EQ(children(STATE + "/51/router/3/appliance"), names{});
+    EXPECT_EQ(said("wccp_get_router_appliance_list failed: status=1"), 1);
+    EXPECT_EQ(said("iterate " + STATE + "/51/router/2/appliance"), 1);
+}
+
+} // namespace
