@@ -1,0 +1,184 @@
+// The exit that begins while the daemon waits for mgmtd: by a signal, by the loss of the session, by the word
+// that tunneld has gone, at each request of the start and once the daemon is ready. The daemon runs in a
+// process of its own; the provider is this test, which answers so many requests and no more.
+#include <csignal>
+#include <ctime>
+
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+
+#include "daemon/wccpd_main.h"
+#include "mgmt/owners.h"
+#include "tests/support/gcl_provider.h"
+
+namespace {
+
+constexpr double EXIT_SECONDS = 3;
+constexpr double CPU_SECONDS = 1;
+constexpr int QUIET_MS = 1000; // a daemon that asks nothing for so long is ready
+
+enum class cause { signal, lost_session, tunneld };
+const char *const cause_names[] = {"SIGTERM", "the session lost", "tunneld gone"};
+
+double now_seconds() {
+    timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+}
+double seconds_of(const timeval &time) {
+    return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_usec) / 1e6;
+}
+wire frame_of(uint16_t mtype, const tbuffer *bytes) {
+    const wire whole(reinterpret_cast<const char *>(tb_buf(bytes)), static_cast<size_t>(tb_length(bytes)));
+    return frame_bytes(BN_PROTO, mtype, whole.substr(BN_FRAME_HEADER_BYTES));
+}
+
+struct scripted_run {
+    gcl_provider working, alarms;
+    pid_t daemon = 0;
+
+    scripted_run() {
+        // The platform's numbers, without which there is no mailbox.
+        EXPECT_EQ(system("cp " WCCP_SOURCE_DIR "/packaging/*.conf /etc/opt/rvl/"), 0);
+        EXPECT_TRUE(working.listen_as("mgmtd"));
+        daemon = fork();
+        if (daemon == 0)
+            _exit(wccpd_main()); // ends by itself
+    }
+    ~scripted_run() {
+        if (daemon > 0) {
+            kill(daemon, SIGKILL);
+            waitpid(daemon, nullptr, 0);
+        }
+    }
+    scripted_run(const scripted_run &) = delete;
+    scripted_run &operator=(const scripted_run &) = delete;
+
+    // The next frame on the working session; the alarm session opens in between. Empty when none comes.
+    wire next_frame() {
+        for (;;) {
+            pollfd watched[] = {{working.client, POLLIN, 0},
+                                {alarms.client < 0 ? working.listener : -1, POLLIN, 0}};
+            if (working.unread.empty() && poll(watched, 2, QUIET_MS) <= 0)
+                return {};
+            if (!watched[1].revents)
+                return working.take_frame();
+            alarms.listener = working.listener;
+            EXPECT_TRUE(alarms.open_session());
+            alarms.listener = -1;
+        }
+    }
+    // Every query finds nothing, but for the system mode.
+    void answer(const wire &frame) {
+        owned_tbuffer bytes, out;
+        owned_request request;
+        owned_response response;
+        ASSERT_EQ(tb_new_buf(&bytes.pointer, frame.data(), static_cast<int32_t>(frame.size())), LC_OK);
+        ASSERT_EQ(bn_request_msg_deserialize(bytes.pointer, BN_FRAME_HEADER_BYTES, &request.pointer), LC_OK);
+        const uint16_t type = bn_request_msg_response_msg_type(request.pointer->msg_type);
+        ASSERT_EQ(bn_response_msg_create(&response.pointer, type, request.pointer->msg_id, 0, ""), LC_OK);
+        const bn_request_node *node = bn_request_per_node_array_get_quick(request.pointer->nodes, 0);
+        const char *mode = "/qv/tunneld/system/config/mode";
+        if (type == bn_msg_query_response && node &&
+            strcmp(bn_binding_get_name_quick(node->binding), mode) == 0) {
+            owned_binding binding;
+            ASSERT_EQ(bn_binding_new_str(&binding.pointer, mode, bn_attrib_value, bn_type_str, 0, "router"),
+                      LC_OK);
+            ASSERT_EQ(bn_query_response_msg_append_binding_takeover(response.pointer, &binding.pointer,
+                                                                    node->node_id),
+                      LC_OK);
+        }
+        response.pointer->service_id = 2;
+        response.pointer->msg_id = 1;
+        ASSERT_EQ(bn_response_msg_serialize(response.pointer, BN_FRAME_HEADER_BYTES, &out.pointer), LC_OK);
+        ASSERT_TRUE(working.put(frame_of(type, out.pointer)));
+    }
+    // Answers `count` requests, and reads one more without answering it. The number of requests read.
+    int serve(int count) {
+        EXPECT_TRUE(working.open_session());
+        for (int read = 0;; read++) {
+            const wire frame = next_frame();
+            if (frame.empty() || read == count)
+                return read + !frame.empty();
+            answer(frame);
+        }
+    }
+    void put_request(bn_request_msg *request) {
+        owned_tbuffer out;
+        request->service_id = 2;
+        request->msg_id = 1;
+        request->transaction_id = 2;
+        ASSERT_EQ(bn_request_msg_serialize(request, BN_FRAME_HEADER_BYTES, &out.pointer), LC_OK);
+        ASSERT_TRUE(working.put(frame_of(request->msg_type, out.pointer)));
+    }
+    void bring(cause what) {
+        if (what == cause::signal)
+            kill(daemon, SIGTERM);
+        if (what == cause::lost_session) {
+            working.close_client();
+            alarms.close_client();
+        }
+        if (what == cause::tunneld) {
+            owned_request event;
+            ASSERT_EQ(bn_event_request_msg_create(&event.pointer, "/pm/events/failure/crash"), LC_OK);
+            ASSERT_EQ(bn_event_request_msg_append_new_binding(event.pointer, 0, "process_name", bn_type_str,
+                                                              "tunneld", nullptr),
+                      LC_OK);
+            put_request(event.pointer);
+        }
+    }
+    void expect_exit() {
+        const double start = now_seconds();
+        int status = -1;
+        rusage used = {};
+        while (wait4(daemon, &status, WNOHANG, &used) != daemon) {
+            ASSERT_LT(now_seconds() - start, EXIT_SECONDS) << "the daemon does not end";
+            usleep(2000);
+        }
+        daemon = 0;
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
+        EXPECT_LT(seconds_of(used.ru_utime) + seconds_of(used.ru_stime), CPU_SECONDS);
+    }
+};
+
+} // namespace
+
+TEST(DaemonExit, AtEachRequestOfTheStart) {
+    int requests = 0;
+    {
+        scripted_run whole;
+        requests = whole.serve(1000);
+        EXPECT_GE(requests, 15);
+        whole.bring(cause::signal);
+        whole.expect_exit();
+    }
+    for (const cause what : {cause::signal, cause::lost_session, cause::tunneld})
+        for (int answered = 0; answered < requests; answered++) {
+            SCOPED_TRACE(std::string(cause_names[static_cast<int>(what)]) + " at request " +
+                         std::to_string(answered + 1));
+            scripted_run run;
+            ASSERT_EQ(run.serve(answered), answered + 1);
+            run.bring(what);
+            run.expect_exit();
+            if (HasFatalFailure())
+                return;
+        }
+}
+
+TEST(DaemonExit, WhileTheServiceIsNotOpen) {
+    scripted_run run;
+    ASSERT_TRUE(run.working.accept_client());
+    run.bring(cause::signal);
+    run.expect_exit();
+}
+
+TEST(DaemonExit, OnceReadyByASessionOrTunneld) {
+    for (const cause what : {cause::lost_session, cause::tunneld}) {
+        SCOPED_TRACE(cause_names[static_cast<int>(what)]);
+        scripted_run run;
+        ASSERT_GE(run.serve(1000), 15);
+        run.bring(what);
+        run.expect_exit();
+    }
+}
