@@ -1,0 +1,80 @@
+// The small steps of the start, each by itself: the pid file, the reserved entries, what signals do.
+#include "daemon/wccpd_main.h"
+
+#include <csignal>
+#include <fstream>
+#include <sstream>
+
+#include <sys/stat.h>
+
+#include "engine/wccp_host.h"
+#include "platform/limits.h"
+#include "tests/support/daemon_engine.h"
+
+namespace {
+
+constexpr const char *PID_FILE = "/var/run/wccpd.pid";
+
+std::string content(const char *path) {
+    std::ostringstream text;
+    text << std::ifstream(path).rdbuf();
+    return text.str();
+}
+
+struct DaemonMain : testing::Test {
+    daemon_engine engine;
+    void TearDown() override { unlink(PID_FILE); }
+    int said(const std::string &line) { return engine.log.count(line); }
+};
+
+TEST_F(DaemonMain, ThePidFileHoldsThePidAndNothingOld) {
+    const std::string pid = std::to_string(getpid()) + "\n";
+    std::ofstream(PID_FILE) << "an earlier text that is longer than any number";
+    EXPECT_EQ(wccpd_pid_init(), LC_OK);
+    EXPECT_EQ(content(PID_FILE), pid);
+    struct stat found = {};
+    ASSERT_EQ(lstat(PID_FILE, &found), 0);
+    EXPECT_EQ(found.st_mode & 0777, 0644u);
+    EXPECT_EQ(said("Writing "), 0);
+}
+
+TEST_F(DaemonMain, ThePidFileIsNotWrittenThroughALink) {
+    std::ofstream("/tmp/precious") << "kept";
+    for (int (*link_to)(const char *, const char *) : {symlink, link}) {
+        unlink(PID_FILE);
+        const char *target = link_to == symlink ? "/tmp/precious" : "/var/run/other";
+        std::ofstream("/var/run/other") << "kept";
+        ASSERT_EQ(link_to(target, PID_FILE), 0);
+        engine.log.clear();
+        EXPECT_NE(wccpd_pid_init(), LC_OK);
+        EXPECT_EQ(said("Writing /var/run/wccpd.pid: "), 1);
+        EXPECT_EQ(content(target), "kept");
+    }
+}
+
+TEST_F(DaemonMain, EntriesOfTheEncapsulations) {
+    std::ofstream(PLATFORM_CONF_PATH) << "max_user_tunnels 78\n"; // 100 with those of the system
+    EXPECT_EQ(qv_encap_setup_entries(), 184u);
+    EXPECT_EQ(g_qv_encap_wccp_first, 110u);
+    EXPECT_EQ(g_qv_encap_wccp_last, 141u);
+    EXPECT_EQ(g_qv_encap_clstr_first, 151u);
+    EXPECT_EQ(g_qv_encap_clstr_last, 182u);
+}
+
+TEST_F(DaemonMain, SignalsThatLeaveItRunning) {
+    for (const int number : {SIGPIPE, SIGUSR1, SIGUSR2, SIGCHLD})
+        EXPECT_EQ(wccpd_handle_signal(number, 0, nullptr, nullptr), LC_OK);
+    EXPECT_EQ(wccpd_shutdown_in_progress(), 0);
+    EXPECT_EQ(said("Received SIGPIPE"), 1);
+    EXPECT_EQ(said("Received SIGUSR2"), 1);
+    EXPECT_EQ(said("Got unexpected signal"), 1);
+    EXPECT_EQ(said("Got unexpected signal SIGCHLD"), 1);
+}
+
+TEST_F(DaemonMain, TheEngineNeedsALoop) {
+    EXPECT_EQ(wccpd_serv_init(), LC_ASSERTION);
+    EXPECT_EQ(said("Required condition was not met"), 1);
+    EXPECT_EQ(wccpd_main_loop(), LC_NULL);
+}
+
+} // namespace
