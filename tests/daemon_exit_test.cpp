@@ -37,6 +37,8 @@ wire frame_of(uint16_t mtype, const tbuffer *bytes) {
 struct scripted_run {
     gcl_provider working, alarms;
     pid_t daemon = 0;
+    wire unanswered;
+    std::vector<wire> responses;
 
     scripted_run() {
         // The platform's numbers, without which there is no mailbox.
@@ -94,15 +96,35 @@ struct scripted_run {
         ASSERT_EQ(bn_response_msg_serialize(response.pointer, BN_FRAME_HEADER_BYTES, &out.pointer), LC_OK);
         ASSERT_TRUE(working.put(frame_of(type, out.pointer)));
     }
-    // Answers `count` requests, and reads one more without answering it. The number of requests read.
+    // Answers the one that waits and `count` more, and reads another without answering it. The number read.
     int serve(int count) {
-        EXPECT_TRUE(working.open_session());
+        if (working.client < 0) {
+            EXPECT_TRUE(working.open_session());
+        }
+        if (!unanswered.empty())
+            answer(unanswered);
+        unanswered.clear();
         for (int read = 0;; read++) {
             const wire frame = next_frame();
-            if (frame.empty() || read == count)
-                return read + !frame.empty();
+            if (frame.empty())
+                return read;
+            if (number_at(frame, 26, 2) % 2 == 0) {
+                responses.push_back(frame);
+                read--;
+                continue;
+            }
+            if (read == count) {
+                unanswered = frame;
+                return read + 1;
+            }
             answer(frame);
         }
+    }
+    void ask(const char *node) {
+        owned_request query;
+        ASSERT_EQ(bn_query_request_msg_create(&query.pointer, 0, nullptr), LC_OK);
+        ASSERT_EQ(bn_query_request_msg_append_str(query.pointer, bn_query_get, 0, node, nullptr), LC_OK);
+        put_request(query.pointer);
     }
     void put_request(bn_request_msg *request) {
         owned_tbuffer out;
@@ -169,6 +191,37 @@ TEST(DaemonExit, AtEachRequestOfTheStart) {
 TEST(DaemonExit, WhileTheServiceIsNotOpen) {
     scripted_run run;
     ASSERT_TRUE(run.working.accept_client());
+    run.bring(cause::signal);
+    run.expect_exit();
+}
+
+// The start waits for the alarm thread then, which waits for the provider.
+TEST(DaemonExit, WhileTheAlarmSessionIsNotOpen) {
+    for (const cause what : {cause::signal, cause::lost_session}) {
+        SCOPED_TRACE(cause_names[static_cast<int>(what)]);
+        scripted_run run;
+        ASSERT_EQ(run.serve(4), 5); // the interests
+        run.answer(run.unanswered);
+        run.alarms.listener = run.working.listener;
+        ASSERT_TRUE(run.alarms.accept_client());
+        run.alarms.listener = -1;
+        run.bring(what);
+        run.expect_exit();
+    }
+}
+
+// Queries find the daemon deaf until it is ready.
+TEST(DaemonExit, AQueryThatComesTooEarlyStaysUnanswered) {
+    scripted_run run;
+    ASSERT_EQ(run.serve(7), 8);
+    run.ask("/qv/wccpd/system/state/is_alive");
+    ASSERT_GE(run.serve(1000), 5);
+    EXPECT_EQ(run.responses.size(), 0u);
+    run.ask("/qv/wccpd/system/state/is_alive");
+    ASSERT_EQ(run.serve(1000), 0);
+    ASSERT_EQ(run.responses.size(), 1u);
+    EXPECT_EQ(number_at(run.responses[0], 26, 2), bn_msg_query_response);
+    EXPECT_NE(run.responses[0].find("Ready"), wire::npos);
     run.bring(cause::signal);
     run.expect_exit();
 }
