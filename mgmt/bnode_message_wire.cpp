@@ -31,6 +31,30 @@ static_assert(offsetof(bn_wire_request_header, length) == 4 && offsetof(bn_wire_
 static_assert(offsetof(bn_wire_request_header, transaction_id) == 12);
 static_assert(sizeof(bn_wire_response_header) == 20 && offsetof(bn_wire_response_header, response_to) == 16);
 
+static void bn_byte_swap_request_header(const bn_request_msg *msg, bn_wire_request_header *out) {
+    *out = {to_be16(msg->service_id), to_be16(msg->msg_type), to_be32(msg->length), to_be32(msg->msg_id),
+            to_be32(msg->transaction_id)};
+}
+static void bn_byte_swap_request_header(const bn_wire_request_header *wire, bn_request_msg *msg) {
+    msg->service_id = to_host(wire->service_id);
+    msg->msg_type = to_host(wire->msg_type);
+    msg->length = to_host(wire->length);
+    msg->msg_id = to_host(wire->msg_id);
+    msg->transaction_id = to_host(wire->transaction_id);
+}
+static void bn_byte_swap_response_header(const bn_response_msg *msg, bn_wire_response_header *out) {
+    *out = {to_be16(msg->service_id), to_be16(msg->msg_type),       to_be32(msg->length),
+            to_be32(msg->msg_id),     to_be32(msg->transaction_id), to_be32(msg->response_to)};
+}
+static void bn_byte_swap_response_header(const bn_wire_response_header *wire, bn_response_msg *msg) {
+    msg->service_id = to_host(wire->service_id);
+    msg->msg_type = to_host(wire->msg_type);
+    msg->length = to_host(wire->length);
+    msg->msg_id = to_host(wire->msg_id);
+    msg->transaction_id = to_host(wire->transaction_id);
+    msg->response_to = to_host(wire->response_to);
+}
+
 // --- Writing
 // --------------------------------------------------------------------------------------------------------
 
@@ -112,6 +136,9 @@ static lc_status put_options(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_u32(buffer, msg->flags));
     CHECK_STATUS(put_string(buffer, msg->text));
     CHECK_STATUS(put_u32(buffer, msg->number));
+    return LC_OK;
+}
+static lc_status put_no_message(tbuffer *, const bn_request_msg *) {
     return LC_OK;
 }
 static lc_status put_message_name(tbuffer *buffer, const bn_request_msg *msg) {
@@ -220,6 +247,9 @@ static lc_status get_options(wire_reader *reader, bn_request_msg *msg) {
     CHECK_STATUS(get_u32(reader, &msg->number));
     return LC_OK;
 }
+static lc_status get_no_message(wire_reader *, bn_request_msg *) {
+    return LC_OK;
+}
 static lc_status get_message_name(wire_reader *reader, bn_request_msg *msg) {
     CHECK_STATUS(get_string(reader, &msg->text));
     return LC_OK;
@@ -243,12 +273,15 @@ static const request_trailers request_types[] = {
     {bn_msg_event, put_no_node, get_no_node, put_message_name, get_message_name},
 };
 
+// A message of another type is told in the log and has no trailers; who receives one refuses it by its type,
+// and the session goes on.
 static const request_trailers *trailers_of(uint16_t type) {
+    static const request_trailers none = {0, put_no_node, get_no_node, put_no_message, get_no_message};
     for (const request_trailers &known : request_types)
         if (known.msg_type == type)
             return &known;
     LC_LOG(LC_LOG_ERR, "illegal messsage of type %d", type);
-    return nullptr;
+    return &none;
 }
 
 static lc_status start_buffer(uint32_t header_bytes, owned_tbuffer *out) {
@@ -264,7 +297,6 @@ lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, t
     *out = nullptr;
     CHECK_NULL(msg);
     const request_trailers *trailers = trailers_of(msg->msg_type);
-    CHECK_CONDITION(trailers != nullptr);
     owned_tbuffer buffer;
     CHECK_STATUS(start_buffer(header_bytes, &buffer));
     tbuffer *bytes = buffer.pointer;
@@ -289,8 +321,7 @@ lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, t
     CHECK_STATUS(put_u32_at(bytes, count_at, written));
     CHECK_STATUS(trailers->put_message(bytes, msg));
     msg->length = used(bytes);
-    header = {to_be16(msg->service_id), to_be16(msg->msg_type), to_be32(msg->length), to_be32(msg->msg_id),
-              to_be32(msg->transaction_id)};
+    bn_byte_swap_request_header(msg, &header);
     CHECK_STATUS(tb_put_buf(bytes, header_bytes, &header, sizeof header));
     *out = buffer.take();
     return LC_OK;
@@ -304,13 +335,9 @@ lc_status bn_request_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_
     bn_wire_request_header header = {};
     CHECK_STATUS(get_bytes(&reader, &header, sizeof header));
     const request_trailers *trailers = trailers_of(to_host(header.msg_type));
-    CHECK_CONDITION(trailers != nullptr);
     owned_request msg;
     CHECK_STATUS(bn_request_msg_create(&msg.pointer, to_host(header.msg_type)));
-    msg.pointer->service_id = to_host(header.service_id);
-    msg.pointer->length = to_host(header.length);
-    msg.pointer->msg_id = to_host(header.msg_id);
-    msg.pointer->transaction_id = to_host(header.transaction_id);
+    bn_byte_swap_request_header(&header, msg.pointer);
     CHECK_STATUS(get_string(&reader, &msg.pointer->audit_user));
     uint32_t count = 0;
     CHECK_STATUS(get_u32(&reader, &count));
@@ -364,8 +391,7 @@ lc_status bn_response_msg_serialize(bn_response_msg *msg, uint32_t header_bytes,
     if (has_revision(msg->msg_type))
         CHECK_STATUS(put_u32(bytes, msg->db_revision_id));
     msg->length = used(bytes);
-    header = {to_be16(msg->service_id), to_be16(msg->msg_type),       to_be32(msg->length),
-              to_be32(msg->msg_id),     to_be32(msg->transaction_id), to_be32(msg->response_to)};
+    bn_byte_swap_response_header(msg, &header);
     CHECK_STATUS(tb_put_buf(bytes, header_bytes, &header, sizeof header));
     *out = buffer.take();
     return LC_OK;
@@ -379,12 +405,8 @@ lc_status bn_response_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn
     bn_wire_response_header header = {};
     CHECK_STATUS(get_bytes(&reader, &header, sizeof header));
     owned_response msg;
-    CHECK_STATUS(bn_response_msg_create(&msg.pointer, to_host(header.msg_type), to_host(header.response_to),
-                                        0, nullptr));
-    msg.pointer->service_id = to_host(header.service_id);
-    msg.pointer->length = to_host(header.length);
-    msg.pointer->msg_id = to_host(header.msg_id);
-    msg.pointer->transaction_id = to_host(header.transaction_id);
+    CHECK_STATUS(bn_response_msg_create(&msg.pointer, to_host(header.msg_type), 0, 0, nullptr));
+    bn_byte_swap_response_header(&header, msg.pointer);
     CHECK_STATUS(get_u32(&reader, &msg.pointer->return_code));
     CHECK_STATUS(get_string(&reader, &msg.pointer->return_message));
     uint32_t count = 0;

@@ -492,10 +492,12 @@ static lc_status read_response(const bn_response_msg *msg, bool take, uint32_t *
         owned_binding binding;
         if (!node->binding)
             continue;
+        CHECK_STATUS(uint32_array_append(ids.pointer, node->node_id));
+        if (!out_bindings)
+            continue;
         CHECK_STATUS(read_node(node, take, &binding.pointer));
         CHECK_STATUS(settle_parts(binding.pointer, keep_parts));
         CHECK_STATUS(bn_binding_array_append_takeover(bindings.pointer, &binding.pointer));
-        CHECK_STATUS(uint32_array_append(ids.pointer, node->node_id));
     }
     if (out_code)
         *out_code = msg->return_code;

@@ -115,9 +115,10 @@ static lc_status change_process_level(const bn_binding *binding, bool *ended) {
     return LC_OK;
 }
 
-static lc_status change_system_level(const bn_binding *binding, bool *) {
+static lc_status change_system_level(const bn_binding *binding, bool *ended) {
     owned_tstring value;
     CHECK_STATUS(value_text(binding, &value));
+    *ended = value.pointer != nullptr;
     if (!value.pointer)
         return LC_OK;
     CHECK_STATUS(lc_log_set_max_log_level(ts_str(value.pointer)));

@@ -12,6 +12,8 @@
 #include "runtime/logging.h"
 
 constexpr const char *WILDCARD = "*";
+// The tree is walked and freed by recursion, and its names come from a peer: a deeper one is not registered.
+constexpr uint32_t REGISTERED_PARTS_MAX = 64;
 
 // --- Registered nodes
 // -----------------------------------------------------------------------------------------------
@@ -179,6 +181,12 @@ static lc_status add_registration(tree *registered, const bn_binding *binding) {
     CHECK_STATUS(bn_attrib_get_uint32(attribute, &id, nullptr, &mask));
     if (id != bn_attrib_capability_mask) {
         LC_LOG(LC_LOG_ERR, "Expected cap_mask attribute got %d", static_cast<int>(id));
+        return LC_OK;
+    }
+    const tstr_array *parts = nullptr;
+    CHECK_STATUS(bn_binding_get_name_parts_const(binding, &parts, nullptr));
+    if (tstr_array_length_quick(parts) > REGISTERED_PARTS_MAX) {
+        LC_LOG(LC_LOG_ERR, "Registered name of %u parts ignored", tstr_array_length_quick(parts));
         return LC_OK;
     }
     owned_reg record;
