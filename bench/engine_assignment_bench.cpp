@@ -134,17 +134,22 @@ void tick_of_256_groups(benchmark::State &state) {
         routers.push_back(host(i + 200));
         appliances.push_back({host(i + 1), 100});
     }
-    const double before = resident_kb();
+    // Told by the first call: what a later one takes has been freed by the one before it.
+    static const double before = resident_kb();
+    static double with_1_group, with_256_groups;
     for (uint32_t id = 0; id < WCCP_MAX_GROUPS; id++) {
-        if (id == 1)
-            state.counters["kB_with_1_group"] = resident_kb() - before;
+        if (id == 1 && with_1_group == 0)
+            with_1_group = resident_kb() - before;
         groups.push_back(std::make_unique<reported_group>(true, static_cast<uint8_t>(id)));
         groups.back()->group->hia_timer.countdown = id % 10 + 1;
         groups.back()->group->monitor_timer.countdown = id % 5 + 1;
         for (const be32 router : routers)
             groups.back()->see(router, routers, appliances);
     }
-    state.counters["kB_with_256_groups"] = resident_kb() - before;
+    if (with_256_groups == 0)
+        with_256_groups = resident_kb() - before;
+    state.counters["kB_with_1_group"] = with_1_group;
+    state.counters["kB_with_256_groups"] = with_256_groups;
     G_log_level = LC_LOG_EMERG;
     pass_seconds(1); // the elections
     const double floor = seconds_each([] {
