@@ -1,0 +1,54 @@
+// One session of mgmtctl with mgmtd: requests that wait for their answers, and events as they come.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <string>
+#include <vector>
+
+// A binding as text: the type is its name ("uint32", "string", "ipv4addr"), the value what a person reads.
+struct ctl_binding {
+    std::string name; // "/a/b"; a "/" within a part is written "\/"
+    std::string type;
+    std::string value;
+};
+
+// What mgmtd answers. Code 0 is success; others are status codes (14008 a bad value, ...), with the reason.
+struct ctl_reply {
+    uint32_t code = 0;
+    std::string message;
+    std::vector<ctl_binding> bindings;
+};
+
+struct ctl_event {
+    std::string name;
+    std::vector<ctl_binding> bindings;
+};
+
+enum class ctl_walk { node, children, subtree, leaves };
+enum class ctl_change { create, modify, remove, reset };
+struct ctl_change_item {
+    ctl_change change;
+    ctl_binding binding; // removed and reset ones need only the name; a type left empty is sent as a string
+};
+
+struct ctl_session; // owned by whoever opened it
+
+// Null, with the reason, when mgmtd isn't there, refuses, or doesn't answer in time. All waits of the session
+// are bounded by `timeout_ms`.
+ctl_session *ctl_open(int64_t timeout_ms, std::string *out_reason);
+void ctl_close(ctl_session *session);
+
+// False, with the reason, when no answer came: the session is of no use then.
+bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason);
+// One commit.
+bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, ctl_reply *out,
+             std::string *out_reason);
+bool ctl_action(ctl_session *session, const std::string &name, const std::vector<ctl_binding> &bindings,
+                ctl_reply *out, std::string *out_reason);
+// Asks for an event, only with a binding that matches one of the patterns when there are any.
+bool ctl_add_interest(ctl_session *session, const std::string &event, const std::vector<std::string> &patterns,
+                      std::string *out_reason);
+// Waits for the next event, also one that came during a request. 1: it is here; 0: none within `wait_ms` (-1: no
+// limit); -1: the session has ended, with the reason. A signal that a handler takes ends the wait with 0.
+int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason);
