@@ -1,9 +1,12 @@
 // mgmtd [--config FILE] [--check] [--supervise [--wccpd PATH] [--tunneld PATH]]
+#include <algorithm>
+#include <climits>
 #include <csignal>
 #include <cstdio>
 #include <cstring>
 #include <ctime>
 
+#include <poll.h>
 #include <sys/signalfd.h>
 #include <unistd.h>
 
@@ -22,9 +25,19 @@ static int64_t monotonic_ms() {
     return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
 }
 
+// Nobody has to read what is said: a pipe that is full, or a terminal that is held, loses lines and stops
+// nothing. Up to PIPE_BUF bytes fit whole wherever POLLOUT is told.
 static void say(const std::string &line) {
-    printf("%s\n", line.c_str());
-    fflush(stdout);
+    static uint64_t lost;
+    std::string text = lost ? "(" + std::to_string(lost) + " lines lost)\n" + line : line;
+    text.resize(std::min<size_t>(text.size(), PIPE_BUF - 1));
+    text += '\n';
+    pollfd out = {STDOUT_FILENO, POLLOUT, 0};
+    if (poll(&out, 1, 0) == 1 && (out.revents & POLLOUT) &&
+        write(STDOUT_FILENO, text.data(), text.size()) > 0)
+        lost = 0;
+    else
+        lost++;
 }
 
 static int block_signals() {
