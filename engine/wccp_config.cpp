@@ -19,6 +19,7 @@
 #include <netinet/in.h>
 #include <sys/socket.h>
 
+#include <bit>
 #include <cstdio>
 #include <cstring>
 
@@ -134,7 +135,8 @@ wccp_interface *find_or_add_interface(const wccp_grp_config *config) {
     return interface;
 }
 
-wccp_service_group *build_group(const wccp_grp_config *config, const wccp_interface *interface) {
+// All of a new group but what belongs to its interface, whose address may change while there is no lock.
+wccp_service_group *build_group(const wccp_grp_config *config) {
     auto *group = static_cast<wccp_service_group *>(wccp_malloc(sizeof(wccp_service_group)));
     if (!group) {
         QV_LOG(LC_LOG_ERR, "WCCP:wccp_add_group: Can't alloc memory");
@@ -146,7 +148,6 @@ wccp_service_group *build_group(const wccp_grp_config *config, const wccp_interf
     for (const hash_row &row : hash_rows)
         set_hash_bit(group, &row, config);
     set_masks(group, config, ANY_MASK);
-    group->appliance_ipa = interface->ipa;
     set_password(group, config);
     set_routers(group, config);
     group->weight = config->weight;
@@ -183,12 +184,12 @@ int wccp_add_group(const wccp_grp_config *config) {
         QV_LOG(LC_LOG_ERR, "WCCP:wccp_add_group: Group %d already exists", config->group_id);
         return 1;
     }
-    wccp_service_group *group = build_group(config, interface);
+    wccp_service_group *group = build_group(config);
     if (!group)
         return 1;
 
     const wccp_engine_lock lock;
-    group->appliance_ipa = interface->ipa; // it may have changed while there was no lock
+    group->appliance_ipa = interface->ipa;
     wccp_g.groups[group->id] = group;
     list_push_head(&wccp_g.group_list, group);
     wccp_g.group_count++;
@@ -302,56 +303,70 @@ int wccp_del_all_groups() {
 
 // Changes of one field.
 
-static void wccp_enable_group(wccp_service_group *group, const wccp_grp_config *) {
+static int wccp_enable_group(wccp_service_group *group, const wccp_grp_config *) {
     if (group->admin_state == WCCP_ADMIN_UP)
-        return;
+        return 0;
     group->admin_state = WCCP_ADMIN_UP;
     wccp_start_service_group(group);
+    return 0;
 }
 
-static void wccp_disable_group(wccp_service_group *group, const wccp_grp_config *) {
+static int wccp_disable_group(wccp_service_group *group, const wccp_grp_config *) {
     if (group->admin_state != WCCP_ADMIN_UP)
-        return;
+        return 0;
     wccp_stop_service_group(group);
     wccp_alarms_clear_all_raised_alarms(group);
     group->admin_state = WCCP_ADMIN_DOWN;
+    return 0;
 }
 
-static void wccp_set_grp_weight(wccp_service_group *group, const wccp_grp_config *config) {
+static int wccp_set_grp_weight(wccp_service_group *group, const wccp_grp_config *config) {
     group->weight = config->weight;
+    return 0;
 }
 
-static void wccp_set_grp_password(wccp_service_group *group, const wccp_grp_config *config) {
+static int wccp_set_grp_password(wccp_service_group *group, const wccp_grp_config *config) {
     set_password(group, config);
+    return 0;
 }
 
-static void wccp_set_fwd_method(wccp_service_group *group, const wccp_grp_config *config) {
+static int wccp_set_fwd_method(wccp_service_group *group, const wccp_grp_config *config) {
     group->cfg_fwd_method = config->fwd_method;
+    return 0;
 }
 
-static void wccp_set_force_l2_rtn(wccp_service_group *group, const wccp_grp_config *config) {
+static int wccp_set_force_l2_rtn(wccp_service_group *group, const wccp_grp_config *config) {
     group->force_l2_return = config->force_l2_return;
+    return 0;
 }
 
-static void wccp_set_assign_method(wccp_service_group *group, const wccp_grp_config *config) {
+static int wccp_set_assign_method(wccp_service_group *group, const wccp_grp_config *config) {
     group->cfg_assign_method = config->assign_method;
+    return 0;
 }
 
-static void wccp_set_hash(wccp_service_group *group, const wccp_grp_config *config) {
+static int wccp_set_hash(wccp_service_group *group, const wccp_grp_config *config) {
     for (const hash_row &row : hash_rows)
-        if (config->config_flags & row.config_flag) {
+        if (config->config_flags == row.config_flag) {
             set_hash_bit(group, &row, config);
-            return;
+            return 0;
         }
+    QV_LOG(LC_LOG_ERR, "wccp_set_hash: unknown config_flag 0x%x", config->config_flags);
+    return 1;
 }
 
-static void wccp_set_mask(wccp_service_group *group, const wccp_grp_config *config) {
-    const uint32_t asked = config->config_flags & ANY_MASK;
-    set_masks(group, config, asked & (0u - asked)); // the lowest bit alone
+static int wccp_set_mask(wccp_service_group *group, const wccp_grp_config *config) {
+    if (!std::has_single_bit(config->config_flags)) {
+        QV_LOG(LC_LOG_ERR, "wccp_set_mask: unknown config_flag 0x%x", config->config_flags);
+        return 1;
+    }
+    set_masks(group, config, config->config_flags);
+    return 0;
 }
 
-static void wccp_set_compatibility_mode(wccp_service_group *group, const wccp_grp_config *config) {
+static int wccp_set_compatibility_mode(wccp_service_group *group, const wccp_grp_config *config) {
     group->compat_mode = config->compatibility;
+    return 0;
 }
 
 namespace {
@@ -360,7 +375,7 @@ namespace {
 struct modify_row {
     uint32_t config_flags;
     bool (*applies)(const wccp_grp_config *config); // null: always
-    void (*action)(wccp_service_group *group, const wccp_grp_config *config);
+    int (*action)(wccp_service_group *group, const wccp_grp_config *config);
     int result_without_group;
     const char *message_without_group;
 };
@@ -395,10 +410,8 @@ int wccp_modify_grp(const wccp_grp_config *config) {
         if ((config->config_flags & row.config_flags) == 0 || (row.applies && !row.applies(config)))
             continue;
         const wccp_engine_lock lock;
-        if (wccp_service_group *group = wccp_find_group(config->group_id)) {
-            row.action(group, config);
-            return 0;
-        }
+        if (wccp_service_group *group = wccp_find_group(config->group_id))
+            return row.action(group, config);
         QV_LOG(LC_LOG_ERR, row.message_without_group, config->group_id);
         return row.result_without_group;
     }

@@ -151,11 +151,15 @@ static uint8_t *write_assigned_routers(const wccp_service_group *group, void *el
     return reinterpret_cast<uint8_t *>(first + group->sending_router_count);
 }
 
-static uint32_t assigned_slots(const wccp_service_group *group) {
-    uint32_t sum = 0;
+// The line, with group id and both numbers, when the appliances don't have all slots. The message goes out
+// all the same.
+static void tell_unassigned_slots(const wccp_service_group *group, const char *line) {
+    uint32_t assigned = 0;
     for (uint32_t i = 0; i < group->dsg_active_count; i++)
-        sum += group->dsg_appliances[i].assigned;
-    return sum;
+        assigned += group->dsg_appliances[i].assigned;
+    if (assigned != group->bucket_count)
+        QV_LOG(LC_LOG_ERR, line, group->id, static_cast<int>(assigned),
+               static_cast<int>(group->bucket_count));
 }
 
 int wccp_pkt_load_assignment_info_component(wccp_service_group *group, wccp_pkt *pkt) {
@@ -181,10 +185,8 @@ int wccp_pkt_load_assignment_info_component(wccp_service_group *group, wccp_pkt 
     for (uint32_t i = 0; i < appliances; i++)
         *address++ = group->dsg_appliances[i].ipa;
     memcpy(address, group->bucket_index, sizeof group->bucket_index);
-    if (const uint32_t assigned = assigned_slots(group); assigned != group->bucket_count)
-        QV_LOG(LC_LOG_ERR,
-               "WCCP GRP %d: TX HASH redirect assign: not all buckets are assigned. assigned: %d total: %d",
-               group->id, static_cast<int>(assigned), static_cast<int>(group->bucket_count));
+    tell_unassigned_slots(
+        group, "WCCP GRP %d: TX HASH redirect assign: not all buckets are assigned. assigned: %d total: %d");
     return advance(pkt, size);
 }
 
@@ -228,10 +230,8 @@ int wccp_pkt_load_mask_assignment_info_component(wccp_service_group *group, wccp
         *out++ = {.value = {to_be32(value->src_ip), to_be32(value->dst_ip), to_be16(value->src_port),
                             to_be16(value->dst_port)},
                   .appliance_id = value->appliance_ipa};
-    if (const uint32_t assigned = assigned_slots(group); assigned != group->bucket_count)
-        QV_LOG(LC_LOG_ERR,
-               "WCCP GRP %d: TX MASK redirect assign: not all buckets are assigned. assigned: %d total: %d",
-               group->id, static_cast<int>(assigned), static_cast<int>(group->bucket_count));
+    tell_unassigned_slots(
+        group, "WCCP GRP %d: TX MASK redirect assign: not all buckets are assigned. assigned: %d total: %d");
     return advance(pkt, size);
 }
 

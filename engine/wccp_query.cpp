@@ -19,12 +19,13 @@ static const char *word_of(const char *const (&words)[Count], uint32_t value) {
     return value < Count ? words[value] : "unknown";
 }
 
-// The place-th record of a list, counted from 1.
+// The place-th record of a list, counted from 1; the line, with group id and place, where there is none.
 template <typename T>
-static T *nth(T *head, uint32_t place) {
+static T *nth_or_tell(T *head, uint32_t place, const char *absent, int id) {
     for (uint32_t i = 1; head; head = head->next, i++)
         if (i == place)
             return head;
+    QV_LOG(LC_LOG_INFO, absent, id, static_cast<int>(place));
     return nullptr;
 }
 
@@ -77,12 +78,10 @@ int wccp_get_grp_router_info(int id, wccp_grp_router_info *info) {
     const wccp_service_group *group = find_group_or_tell(id);
     if (!group)
         return 1;
-    const wccp_sending_router *router = nth(group->sending_routers, info->router_num);
-    if (!router) {
-        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: Router number %d not present", id,
-               static_cast<int>(info->router_num));
+    const wccp_sending_router *router = nth_or_tell(group->sending_routers, info->router_num,
+                                                    "WCCP GRP %d: Router number %d not present", id);
+    if (!router)
         return 0;
-    }
     info->router_id = router->router_id;
     info->src_ipa = router->src_ipa;
     info->conn_time = wccp_g.seconds - router->state_time;
@@ -103,12 +102,10 @@ int wccp_get_grp_appliance_info(int id, wccp_grp_appliance_info *info) {
     const wccp_service_group *group = wccp_find_group(id);
     if (!group)
         return 0;
-    const wccp_view_appliance *appliance = nth(group->appliance_view, info->appliance_num);
-    if (!appliance) {
-        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance number %d not present", id,
-               static_cast<int>(info->appliance_num));
+    const wccp_view_appliance *appliance = nth_or_tell(group->appliance_view, info->appliance_num,
+                                                       "WCCP GRP %d: appliance number %d not present", id);
+    if (!appliance)
         return 0;
-    }
     info->ipa = appliance->ipa;
     info->weight = appliance->weight;
     return 0;
@@ -120,11 +117,8 @@ wccp_sending_router *wccp_find_router_instance(int id, uint32_t router_num) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find router: cannot find group id %d", id, id);
         return nullptr;
     }
-    wccp_sending_router *router = nth(group->sending_routers, router_num);
-    if (!router)
-        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find router: router number %d not present", id,
-               static_cast<int>(router_num));
-    return router;
+    return nth_or_tell(group->sending_routers, router_num,
+                       "WCCP GRP %d: find router: router number %d not present", id);
 }
 
 int wccp_get_router_list(wccp_router_list *list) {

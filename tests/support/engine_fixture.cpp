@@ -4,10 +4,14 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <filesystem>
+#include <fstream>
 #include <new>
 
+#include "engine/cthread.h"
 #include "engine/wccp_config.h"
 #include "engine/wccp_host.h"
+#include "engine/wccp_link_mgr.h"
 #include "engine/wccp_network.h"
 
 #ifdef WCCP_SANITIZED
@@ -34,16 +38,48 @@ received_packet make_received(const std::vector<uint8_t> &bytes, be32 from) {
     return pkt;
 }
 
-engine_fixture::engine_fixture() {
+void fresh_engine() {
     wccpd_exiting = 0;
     new (&wccp_g) wccp_global{};
     wccp_g.mcast_ttl = 5;
     for (wccp_interface &each : wccp_g.interfaces)
         each.ucast_fd = each.mcast_fd = -1;
+    wccp_init_network();
+}
+
+void end_engine() {
+    cthread_cancel_all();
+    wccpd_exiting = 0;
+    wccp_del_all_groups();
+    EXPECT_EQ(wccp_g.group_count, 0u);
+    EXPECT_EQ(wccp_g.group_list, nullptr);
+    EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
+    wccp_deinit_link_mgr();
+}
+
+bool link_becomes(const char *interface, uint32_t status) {
+    for (int i = 0; i < 300 && wccp_get_if_status(interface) != status; i++)
+        usleep(10000);
+    return wccp_get_if_status(interface) == status;
+}
+
+int threads_named(const std::string &name) {
+    int count = 0;
+    for (int i = 0; i < 100 && count == 0; i++, usleep(1000))
+        for (const auto &entry : std::filesystem::directory_iterator("/proc/self/task")) {
+            std::ifstream file(entry.path() / "comm");
+            std::string line;
+            count += std::getline(file, line) && line == name;
+        }
+    return count;
+}
+
+engine_fixture::engine_fixture() {
+    fresh_engine();
     peer.link("wan0", "10.0.0.100/24", "peer0", "");
     interface = &wccp_g.interfaces[wccp_g.if_count++];
     strcpy(interface->name, "wan0");
-    interface->ipa = from_raw_word(address_word("10.0.0.100"));
+    interface->ipa = ipa("10.0.0.100");
     interface->link_up = 1;
     interface->ready_flags = WCCP_ALL_READY;
     // An interface that has a thread gets no second one: this one never gets its first.
@@ -52,11 +88,7 @@ engine_fixture::engine_fixture() {
 }
 
 engine_fixture::~engine_fixture() {
-    wccpd_exiting = 0;
-    wccp_del_all_groups();
-    EXPECT_EQ(wccp_g.group_count, 0u);
-    EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
-    wccp_close_sockets(interface);
+    end_engine();
     for (const auto &[address, fd] : sockets)
         close(fd);
     run_command("ip link del wan0");
@@ -66,7 +98,7 @@ wccp_grp_config engine_fixture::group_config(uint8_t id, const std::vector<std::
     wccp_grp_config config = {};
     config.group_id = id;
     for (const std::string &router : routers)
-        config.routers[config.router_count++] = from_raw_word(address_word(router));
+        config.routers[config.router_count++] = ipa(router);
     config.weight = 100;
     config.admin = WCCP_ADMIN_UP;
     config.fwd_method = WCCP_METHOD_L2;

@@ -13,6 +13,15 @@
 // What wccp_is_system_in_bridge_mode answers. The host's other names are in engine/wccp_host.h.
 extern int test_host_bridge_mode;
 
+// The engine's record as its start leaves it: mcast_ttl 5, no interface, no group, no thread.
+void fresh_engine();
+// Ends the threads, groups and sockets of the engine; whatever was allocated must be free again.
+void end_engine();
+// False when it takes more than three seconds: the kernel sees a link come and go some time after the fact.
+bool link_becomes(const char *interface, uint32_t status);
+// How many threads of this process have that name; a thread names itself when it first runs.
+int threads_named(const std::string &name);
+
 // A packet as a receive thread hands it on. Under the address sanitizer nothing behind `length` can be
 // touched.
 using received_packet = std::unique_ptr<wccp_pkt, void (*)(wccp_pkt *)>;
@@ -20,8 +29,8 @@ received_packet make_received(const std::vector<uint8_t> &bytes, be32 from);
 
 // Engine and network of a test: wan0 here has 10.0.0.100/24 and open sockets, peer0 there the routers.
 struct engine_fixture {
-    engine_fixture();  // zeroed wccp_g, mcast_ttl 5, no group
-    ~engine_fixture(); // deletes the groups; whatever was allocated must be free again
+    engine_fixture();
+    ~engine_fixture();
     engine_fixture(const engine_fixture &) = delete;
     engine_fixture &operator=(const engine_fixture &) = delete;
 

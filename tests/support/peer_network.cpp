@@ -33,6 +33,10 @@ uint32_t address_word(const std::string &text) {
     return address.s_addr;
 }
 
+be32 ipa(const std::string &text) {
+    return from_raw_word(address_word(text));
+}
+
 peer_network::peer_network() {
     home = open("/proc/thread-self/ns/net", O_RDONLY);
     EXPECT_EQ(unshare(CLONE_NEWNET), 0);

@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "runtime/byte_order.h"
+
 // Runs a shell command; a failure fails the test that runs.
 void run_command(const std::string &command);
 
@@ -33,3 +35,4 @@ struct datagram {
 datagram receive_datagram(int fd, int wait_ms = 1000);
 void send_datagram(int fd, const std::string &to, uint16_t port, const std::vector<uint8_t> &bytes);
 uint32_t address_word(const std::string &text); // as it lies in memory
+be32 ipa(const std::string &text);
