@@ -488,11 +488,12 @@ static lc_status change_facility(const bn_binding *binding) {
     LC_LOG(LC_LOG_INFO, "system facility to %d(%s), %s", static_cast<int>(facility >> 3), name,
            wccpd_program_name);
     (void)lc_log_file(nullptr, "system facility set to %s, %s", name, wccpd_program_name);
-    // Initialising forgets the level that the daemon was given, which has nothing to do with the facility.
-    const int32_t level = lc_log_get_daemon_log_level();
+    // Initialising forgets what management has set of the levels, which has nothing to do with the facility.
+    lc_log_levels levels;
+    CHECK_STATUS(lc_log_save_levels(&levels));
     CHECK_STATUS(lc_log_init(wccpd_program_name, nullptr, 0, WCCPD_LOG_COMPONENT, LC_LOG_DEBUG,
                              static_cast<int32_t>(facility), 1));
-    CHECK_STATUS(lc_log_set_daemon_log_level(level));
+    CHECK_STATUS(lc_log_restore_levels(&levels));
     return LC_OK;
 }
 
@@ -628,19 +629,18 @@ lc_status wccpd_config_apply(bn_binding_array *new_values) {
     return LC_OK;
 }
 
-int wccp_is_system_in_bridge_mode() {
+static lc_status read_system_mode(owned_tstring *out) {
     owned_binding binding;
-    lc_status status =
-        mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, SYSTEM_MODE, nullptr);
+    CHECK_STATUS(mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, SYSTEM_MODE, nullptr));
+    CHECK_NULL(binding.pointer);
+    CHECK_STATUS(read_text(binding.pointer, out));
+    return LC_OK;
+}
+
+int wccp_is_system_in_bridge_mode() {
     owned_tstring mode;
-    if (status == LC_OK)
-        status = binding.pointer ? bn_binding_get_tstr(binding.pointer, bn_attrib_value, bn_type_str, nullptr,
-                                                       &mode.pointer)
-                                 : LC_NULL;
-    if (status != LC_OK || !mode.pointer) {
-        LOG_STATUS(status != LC_OK ? status : LC_NULL);
+    if (read_system_mode(&mode) != LC_OK)
         return 0;
-    }
     QV_LOG(LC_LOG_INFO, "WCCP current system mode: %s", ts_str(mode.pointer));
     return strcmp(ts_str(mode.pointer), "bridge") == 0;
 }

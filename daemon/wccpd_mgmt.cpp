@@ -20,12 +20,13 @@
 
 gcl_session *wccpd_mgmt_session;
 mdc *wccpd_mcc;
+static gcl *wccpd_gcl_handle;
+static fdic *wccpd_fdic_handle;
+static fdic_libevent *wccpd_fdic_lew_handle;
 static int32_t wccpd_response_expected;
 static int32_t wccpd_expected_request_id;
 static bn_response_msg *wccpd_captured_response;
 
-// The bridge, interest list and instance that stand under the session are the daemon's wccpd_fdic_lew_handle,
-// wccpd_fdic_handle and wccpd_gcl_handle.
 static mgmt_client wccpd_client = {&wccpd_lwc,
                                    &wccpd_mgmt_session,
                                    &wccpd_mcc,
@@ -34,10 +35,9 @@ static mgmt_client wccpd_client = {&wccpd_lwc,
                                    &wccpd_captured_response,
                                    &wccpd_exiting,
                                    "",
-                                   nullptr,
-                                   nullptr,
-                                   nullptr};
-static gcl *&wccpd_gcl_handle = wccpd_client.instance;
+                                   &wccpd_gcl_handle,
+                                   &wccpd_fdic_handle,
+                                   &wccpd_fdic_lew_handle};
 
 static lc_status wccpd_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
                                         bn_response_msg **out_response) {

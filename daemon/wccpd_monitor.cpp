@@ -158,9 +158,10 @@ static lc_status ask_engine(mon_subject *subject, bool *answered) {
     subject->group = static_cast<uint8_t>(number_part(subject, GROUP_PART));
     const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
     const int group = static_cast<int>(group_text ? strtol(group_text, nullptr, 10) : 0);
+    // The parents themselves count as well: a get of one finds no number behind it.
     snprintf(routers, sizeof routers, "%s/%d/router", STATE_ROOT, group);
     snprintf(appliances, sizeof appliances, "%s/%d/appliance", STATE_ROOT, group);
-    if (!is_under(subject->name, routers)) {
+    if (!lc_is_prefix(routers, subject->name, 0)) {
         const int status = wccp_get_grp_info(subject->group, &subject->group_info);
         if (status != 0) {
             LC_LOG(LC_LOG_ERR, "wccp_get_grp_info failed: %d", status);
@@ -172,14 +173,14 @@ static lc_status ask_engine(mon_subject *subject, bool *answered) {
         CHECK_STATUS(wccp_get_grp_router_info(subject->group, &subject->router));
         snprintf(router_appliances, sizeof router_appliances, "%s/%d/router/%d/appliance", STATE_ROOT, group,
                  static_cast<int>(subject->router.router_num));
-        if (is_under(subject->name, router_appliances) &&
+        if (lc_is_prefix(router_appliances, subject->name, 0) &&
             !tstr_array_get_str_quick(subject->parts, ADDRESS_PART)) {
             LC_LOG(LC_LOG_ERR, "Appliance number (at 9th) not found in %s", subject->name);
             *answered = false;
             return LC_OK;
         }
     }
-    if (is_under(subject->name, appliances)) {
+    if (lc_is_prefix(appliances, subject->name, 0)) {
         subject->appliance.appliance_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
         const int status = wccp_get_grp_appliance_info(subject->group, &subject->appliance);
         if (status != 0) {

@@ -27,6 +27,9 @@
 static lew *qv_alm_lwc;
 static mdc *qv_alm_mcc;
 static std::atomic<int32_t> qv_exiting;
+static gcl *qv_alm_instance;
+static fdic *qv_alm_interests;
+static fdic_libevent *qv_alm_bridge;
 static int32_t qv_response_expected;
 static int32_t qv_expected_request_id;
 static bn_response_msg *qv_captured_response;
@@ -38,9 +41,9 @@ static mgmt_client qv_alm_client = {&qv_alm_lwc,
                                     &qv_captured_response,
                                     &qv_exiting,
                                     "qv_alm_mgmt_handle_response :",
-                                    nullptr,
-                                    nullptr,
-                                    nullptr};
+                                    &qv_alm_instance,
+                                    &qv_alm_interests,
+                                    &qv_alm_bridge};
 
 static pthread_t alarm_thread;
 static std::atomic<bool> alarm_thread_runs; // the thread handle is set
@@ -80,11 +83,12 @@ static lc_status qv_alm_mgmt_open_session(const char *client_name) {
 static lc_status start_session(const char *client_name) {
     CHECK_STATUS(lew_init(&qv_alm_lwc));
     CHECK_STATUS(mgmt_client_init(&qv_alm_client, qv_alm_mgmt_handle_session_close));
-    gcl *instance = qv_alm_client.instance;
-    CHECK_STATUS(bn_set_global_callback_query_response_msg(instance, qv_alm_mgmt_handle_response, nullptr));
-    CHECK_STATUS(bn_set_global_callback_action_response_msg(instance, qv_alm_mgmt_handle_response, nullptr));
     CHECK_STATUS(
-        bn_set_global_callback_event_response_msg(instance, qv_alm_mgmt_handle_event_response, nullptr));
+        bn_set_global_callback_query_response_msg(qv_alm_instance, qv_alm_mgmt_handle_response, nullptr));
+    CHECK_STATUS(
+        bn_set_global_callback_action_response_msg(qv_alm_instance, qv_alm_mgmt_handle_response, nullptr));
+    CHECK_STATUS(bn_set_global_callback_event_response_msg(qv_alm_instance, qv_alm_mgmt_handle_event_response,
+                                                           nullptr));
     CHECK_STATUS(qv_alm_mgmt_open_session(client_name));
     return LC_OK;
 }
@@ -147,8 +151,8 @@ lc_status qv_alm_mgmt_shutdown() {
         alarm_thread_runs = false;
     }
     LC_LOG(LC_LOG_INFO, "qv_alm_mgmt_shutdown: alm thread exited");
-    if (qv_alm_client.instance)
-        CHECK_STATUS(gcl_shutdown(qv_alm_client.instance));
+    if (qv_alm_instance)
+        CHECK_STATUS(gcl_shutdown(qv_alm_instance));
     return LC_OK;
 }
 

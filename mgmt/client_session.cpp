@@ -6,12 +6,12 @@
 lc_status mgmt_client_init(mgmt_client *client, fdic_handler close_handler) {
     loop_context *context = nullptr;
     CHECK_STATUS(lew_get_event_context(*client->loop, &context));
-    CHECK_STATUS(fdic_libevent_init(context, &client->bridge));
-    CHECK_STATUS(fdic_init(&client->interests, fdic_libevent_callback, client->bridge));
-    CHECK_STATUS(fdic_libevent_set_fd_close_handler(client->bridge, close_handler, nullptr));
+    CHECK_STATUS(fdic_libevent_init(context, client->bridge));
+    CHECK_STATUS(fdic_init(client->interests, fdic_libevent_callback, *client->bridge));
+    CHECK_STATUS(fdic_libevent_set_fd_close_handler(*client->bridge, close_handler, nullptr));
     gcl_options options;
     CHECK_STATUS(gcl_options_get_defaults(&options));
-    CHECK_STATUS(gcl_init(&client->instance, &options, client->interests));
+    CHECK_STATUS(gcl_init(client->instance, &options, *client->interests));
     return LC_OK;
 }
 
@@ -25,7 +25,7 @@ static lc_status connect_quietly(gcl_session *session) {
 }
 
 static lc_status open_steps(mgmt_client *client, const char *client_name, mdc_send_function msg_handler) {
-    CHECK_STATUS(gcl_session_client_new(client->instance, client_name, nullptr, 0, client->session));
+    CHECK_STATUS(gcl_session_client_new(*client->instance, client_name, nullptr, 0, client->session));
     CHECK_QUIET(connect_quietly(*client->session));
     CHECK_STATUS(gcl_session_client_open_service_blocking(*client->session, 2, 2, nullptr, 0, -1));
     CHECK_STATUS(mdc_init(msg_handler, nullptr, nullptr, nullptr, *client->session, client->handle));
@@ -37,12 +37,12 @@ lc_status mgmt_client_open(mgmt_client *client, const char *client_name, mdc_sen
 }
 
 void mgmt_client_deinit(mgmt_client *client) {
-    LOG_STATUS(gcl_deinit(&client->instance));
+    LOG_STATUS(gcl_deinit(client->instance));
     *client->session = nullptr;
     mdc_free(client->handle);
     (void)bn_response_msg_free(client->captured_response);
-    LOG_STATUS(fdic_libevent_deinit(&client->bridge));
-    LOG_STATUS(fdic_deinit(&client->interests));
+    LOG_STATUS(fdic_libevent_deinit(client->bridge));
+    LOG_STATUS(fdic_deinit(client->interests));
 }
 
 static bool exit_has_begun(const mgmt_client *client) {

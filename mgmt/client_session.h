@@ -26,9 +26,9 @@ struct mgmt_client {
     bn_response_msg **captured_response; // passes to the maker of the request
     const std::atomic<int32_t> *exiting;
     const char *warning_prefix; // in front of the warnings about stray responses
-    gcl *instance;
-    fdic *interests;
-    fdic_libevent *bridge;
+    gcl **instance;
+    fdic **interests;
+    fdic_libevent **bridge;
 };
 
 // Loop context, bridge, interest list, close handler and GCL instance, in this order.

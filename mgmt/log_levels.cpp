@@ -84,6 +84,16 @@ lc_status qv_init_log_level(mdc *session) {
     return LC_OK;
 }
 
+// What the log asks when it is given a session.
+lc_status qv_read_log_facility(mdc *session, uint32_t *out_facility) {
+    owned_binding binding;
+    CHECK_STATUS(mdc_get_binding(session, nullptr, nullptr, 0, &binding.pointer,
+                                 "/logging/syslog/facility/system", nullptr));
+    CHECK_NULL(binding.pointer);
+    CHECK_STATUS(bn_binding_get_uint32(binding.pointer, bn_attrib_value, nullptr, out_facility));
+    return LC_OK;
+}
+
 // --- A change event
 // -------------------------------------------------------------------------------------------------
 

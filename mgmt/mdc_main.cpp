@@ -5,6 +5,7 @@
 #include <cstdarg>
 #include <cstdlib>
 
+#include "mgmt/log_levels.h"
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
 
@@ -25,6 +26,7 @@ lc_status mdc_init(mdc_send_function send, void *client_data, void *reserved_1, 
     CHECK_NULL(handle);
     *handle = {send, client_data, reserved_1, reserved_2, session};
     *out_handle = handle;
+    lc_log_facility_from_session = qv_read_log_facility;
     return LC_OK;
 }
 

@@ -192,8 +192,9 @@ lc_status lc_log_get_syslog_facility(int32_t *out_facility) {
 }
 
 static void settle_overrides(lc_log_state *state, bool overrides) {
+    state->current_level = overrides ? state->override_level : static_cast<uint8_t>(state->system_level);
     if (!has_console(state))
-        make_current(state, overrides ? state->override_level : static_cast<uint8_t>(state->system_level));
+        make_current(state, state->current_level);
 }
 
 static lc_status switch_override(int32_t system_wide, int32_t enable) {
@@ -232,6 +233,39 @@ lc_status lc_log_set_override_log_level(const char *name) {
     if (lc_string_to_enum(lc_log_level_table, name, &level) != LC_OK)
         level = -1;
     CHECK_STATUS(set_override_level(level));
+    return LC_OK;
+}
+
+static lc_status save_levels(lc_log_levels *out) {
+    const locked_state log;
+    if (!log.state)
+        return LC_NULL;
+    *out = {G_daemon_log_level, log.state->system_level, log.state->override_level,
+            log.state->system_override, log.state->class_override};
+    return LC_OK;
+}
+lc_status lc_log_save_levels(lc_log_levels *out) {
+    CHECK_NULL(out);
+    *out = {-1, G_log_level, G_log_level, 0, 0};
+    CHECK_STATUS(save_levels(out));
+    return LC_OK;
+}
+
+static lc_status restore_levels(const lc_log_levels *saved) {
+    const locked_state log;
+    if (!log.state)
+        return LC_NULL;
+    G_daemon_log_level = static_cast<int8_t>(saved->own);
+    log.state->system_level = static_cast<int8_t>(saved->system);
+    log.state->override_level = static_cast<uint8_t>(saved->override);
+    log.state->system_override = saved->system_override;
+    log.state->class_override = saved->class_override;
+    settle_overrides(log.state, overridden(log.state));
+    return LC_OK;
+}
+lc_status lc_log_restore_levels(const lc_log_levels *saved) {
+    CHECK_NULL(saved);
+    CHECK_STATUS(restore_levels(saved));
     return LC_OK;
 }
 

@@ -243,7 +243,7 @@ static void add_stamp(line_format *format, const log_line *line) {
 }
 
 static void add_thread_mark(line_format *format, const log_line *line) {
-    if (line->flags & LC_LOG_FLAG_NO_THREAD)
+    if (!lc_is_multithreaded || (line->flags & LC_LOG_FLAG_NO_THREAD))
         return;
     const uint64_t native = static_cast<uint64_t>(syscall(SYS_gettid));
     const lc_log_thread *const first = line->state->threads, *const end = first + line->state->thread_count;

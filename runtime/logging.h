@@ -39,6 +39,7 @@ enum : uint32_t {
 extern std::atomic<int32_t> G_log_level;       // effective system level
 extern std::atomic<int8_t> G_daemon_log_level; // per-process level, -1 for none
 extern std::atomic<int32_t> G_logging_suspended;
+constexpr int32_t lc_is_multithreaded = 1; // lines carry thread ids
 struct lc_log_state;
 extern lc_log_state *G_log_state;
 extern lc_lock *G_log_state_lock;
@@ -73,6 +74,12 @@ const char *lc_log_get_lls_process_name();
 lc_status lc_log_get_syslog_facility(int32_t *out_facility);
 lc_status lc_log_set_override_log_level(const char *name);
 lc_status lc_log_enable_override_log_level(int32_t system_wide, int32_t enable);
+// All that was set of the levels, for a process that initialises its log anew and wants to keep them.
+struct lc_log_levels {
+    int32_t own, system, override, system_override, class_override;
+};
+lc_status lc_log_save_levels(lc_log_levels *out);
+lc_status lc_log_restore_levels(const lc_log_levels *saved);
 // Lines of the calling thread carry this number from now on, in the place of the system's.
 lc_status lc_log_set_thread_id(uint32_t logged_id);
 

@@ -403,13 +403,20 @@ TEST_F(DaemonConfig, PolicyMembership) {
     EXPECT_EQ(wccp_check_policy_group(6, 72), 0);
 }
 
-TEST_F(DaemonConfig, TheFacilityOfTheLog) {
+TEST_F(DaemonConfig, TheFacilityOfTheLogAndNothingElseOfIt) {
+    EXPECT_EQ(lc_log_set_max_log_level("err"), LC_OK);
+    EXPECT_EQ(lc_log_enable_override_log_level(1, 1), LC_OK);
+    EXPECT_EQ(lc_log_set_override_log_level("info"), LC_OK);
     EXPECT_EQ(change("/logging/syslog/facility/system", bn_type_uint32, "160"), LC_OK);
     EXPECT_EQ(said("system facility to 20(local4), wccpd"), 1);
     engine.log.clear();
     EXPECT_EQ(change("/qv/wccpd/other", bn_type_str, "x"), LC_OK);
     EXPECT_EQ(said("<166>"), said("wccpd["));
     EXPECT_EQ(said("WCCP update: Unsupported binding /qv/wccpd/other"), 1);
+    EXPECT_EQ(lc_log_get_daemon_log_level(), LC_LOG_DEBUG);
+    EXPECT_EQ(G_log_level, LC_LOG_ERR);
+    EXPECT_EQ(lc_log_enable_override_log_level(0, 1), LC_OK);
+    EXPECT_EQ(G_log_level, LC_LOG_INFO);
 }
 
 } // namespace

@@ -192,6 +192,9 @@ TEST_F(DaemonMonitor, WhatIsNotThere) {
     EXPECT_EQ(of_51("colour"), NOTHING);
     EXPECT_EQ(of_51("router/1/colour"), NOTHING);
     EXPECT_EQ(of_51("oper/deeper"), NOTHING);
+    for (const char *parent : {"router", "appliance", "router/1/appliance"})
+        EXPECT_EQ(of_51(parent), NOTHING);
+    EXPECT_EQ(said("Appliance number (at 9th) not found in " + STATE + "/51/router/1/appliance"), 1);
     EXPECT_EQ(get(SYSTEM + "colour"), NOTHING);
     EXPECT_EQ(get("/qv/tunneld/system/state/proto_ver"), NOTHING);
     EXPECT_EQ(said("MonGet not for wccpd, bailing - /qv/tunneld/system/state/proto_ver"), 1);
