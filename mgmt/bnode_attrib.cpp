@@ -148,7 +148,7 @@ lc_status bn_attrib_set_str(bn_attrib *attrib, uint32_t id, uint32_t type, uint3
         return LC_OK;
     }
     CHECK_NULL(text);
-    if (!*text && type < bn_type_str && type != bn_type_any)
+    if (!*text && type < bn_type_str)
         return LC_BAD_TYPE;
     bn_attrib made{};
     made.attribute_id = id;

@@ -198,13 +198,12 @@ static lc_status get_parts(wire_reader *reader, tstr_array **out) {
     return LC_OK;
 }
 
-static lc_status get_attribute(wire_reader *reader, bn_attrib_array *attributes) {
+static lc_status get_attribute(wire_reader *reader, bn_binding *binding) {
     owned_attrib attribute;
     uint32_t count = 0;
     CHECK_STATUS(bn_attrib_read_wire(reader->buffer, reader->offset, &attribute.pointer, &count));
     reader->offset += count;
-    const uint32_t id = attribute.pointer->attribute_id;
-    CHECK_STATUS(bn_attrib_array_set_takeover(attributes, id, &attribute.pointer));
+    CHECK_STATUS(bn_binding_set_attrib_takeover(binding, &attribute.pointer));
     return LC_OK;
 }
 
@@ -213,15 +212,15 @@ static lc_status get_binding(wire_reader *reader, bn_binding **out) {
     CHECK_STATUS(get_bytes(reader, &absolute, sizeof absolute));
     owned_tstr_array parts;
     CHECK_STATUS(get_parts(reader, &parts.pointer));
+    tstring *name = nullptr;
+    owned_binding binding;
+    CHECK_STATUS(bn_binding_new_parts_components_takeover(&binding.pointer, &name, &parts.pointer,
+                                                          absolute ? 1 : 0, nullptr));
     uint32_t count = 0;
     CHECK_STATUS(get_u32(reader, &count));
-    owned_attribs attributes;
-    CHECK_STATUS(bn_attrib_array_new(&attributes.pointer));
     for (uint32_t i = 0; i < count; i++)
-        CHECK_STATUS(get_attribute(reader, attributes.pointer));
-    tstring *name = nullptr;
-    CHECK_STATUS(bn_binding_new_parts_components_takeover(out, &name, &parts.pointer, absolute ? 1 : 0,
-                                                          &attributes.pointer));
+        CHECK_STATUS(get_attribute(reader, binding.pointer));
+    *out = binding.take();
     return LC_OK;
 }
 

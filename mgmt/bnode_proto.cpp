@@ -77,18 +77,25 @@ void bn_response_per_node_free_for_array(void *node) {
     bn_response_node_free(static_cast<bn_response_node *>(node));
 }
 
+// What nodes of both kinds have. On failure `out` is freed by its owner.
+template <typename Node>
+static lc_status copy_node(const Node *node, Node **out) {
+    *out = static_cast<Node *>(calloc(1, sizeof(Node)));
+    CHECK_NULL(*out);
+    (*out)->node_id = node->node_id;
+    (*out)->msg_type = node->msg_type;
+    if (node->binding)
+        CHECK_STATUS(bn_binding_dup(node->binding, &(*out)->binding));
+    return LC_OK;
+}
 lc_status bn_request_per_node_dup_for_array(const void *element, void **out_copy) {
     CHECK_NULL(out_copy);
     *out_copy = nullptr;
     const bn_request_node *node = static_cast<const bn_request_node *>(element);
-    owned_request_node copy(static_cast<bn_request_node *>(calloc(1, sizeof *node)));
-    CHECK_NULL(copy.pointer);
-    copy.pointer->node_id = node->node_id;
-    copy.pointer->msg_type = node->msg_type;
+    owned_request_node copy;
+    CHECK_STATUS(copy_node(node, &copy.pointer));
     copy.pointer->subop = node->subop;
     copy.pointer->flags = node->flags;
-    if (node->binding)
-        CHECK_STATUS(bn_binding_dup(node->binding, &copy.pointer->binding));
     if (node->source)
         CHECK_STATUS(ts_dup(node->source, &copy.pointer->source));
     if (node->target)
@@ -99,13 +106,8 @@ lc_status bn_request_per_node_dup_for_array(const void *element, void **out_copy
 lc_status bn_response_per_node_dup_for_array(const void *element, void **out_copy) {
     CHECK_NULL(out_copy);
     *out_copy = nullptr;
-    const bn_response_node *node = static_cast<const bn_response_node *>(element);
-    owned_response_node copy(static_cast<bn_response_node *>(calloc(1, sizeof *node)));
-    CHECK_NULL(copy.pointer);
-    copy.pointer->node_id = node->node_id;
-    copy.pointer->msg_type = node->msg_type;
-    if (node->binding)
-        CHECK_STATUS(bn_binding_dup(node->binding, &copy.pointer->binding));
+    owned_response_node copy;
+    CHECK_STATUS(copy_node(static_cast<const bn_response_node *>(element), &copy.pointer));
     *out_copy = copy.take();
     return LC_OK;
 }

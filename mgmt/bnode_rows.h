@@ -43,27 +43,11 @@ lc_status bn_text_to_ipaddr(const char *text, lc_ipaddr *out);
 lc_status bn_text_to_ipprefix(const char *text, lc_ipprefix *out);
 
 // The families of the wire form.
-lc_status bn_wire_write_number(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                               uint32_t *out_written);
-lc_status bn_wire_read_number(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                              uint32_t *out_used);
-lc_status bn_wire_write_bytes(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                              uint32_t *out_written);
-lc_status bn_wire_read_bytes(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                             uint32_t *out_used);
-lc_status bn_wire_write_ipaddr(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                               uint32_t *out_written);
-lc_status bn_wire_read_ipaddr(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                              uint32_t *out_used);
-lc_status bn_wire_write_ipprefix(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+using bn_wire_writer = lc_status(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
                                  uint32_t *out_written);
-lc_status bn_wire_read_ipprefix(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                                uint32_t *out_used);
-lc_status bn_wire_write_text(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                             uint32_t *out_written);
-lc_status bn_wire_read_text(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                            uint32_t *out_used);
-lc_status bn_wire_write_binary(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                               uint32_t *out_written);
-lc_status bn_wire_read_binary(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                              uint32_t *out_used);
+using bn_wire_reader = lc_status(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
+                                 uint32_t *out_used);
+bn_wire_writer bn_wire_write_number, bn_wire_write_bytes, bn_wire_write_ipaddr, bn_wire_write_ipprefix,
+    bn_wire_write_text, bn_wire_write_binary;
+bn_wire_reader bn_wire_read_number, bn_wire_read_bytes, bn_wire_read_ipaddr, bn_wire_read_ipprefix,
+    bn_wire_read_text, bn_wire_read_binary;

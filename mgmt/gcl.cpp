@@ -49,7 +49,7 @@ gcl_session_guard::gcl_session_guard(gcl_session *session)
 
 lc_status gcl_options_get_defaults(gcl_options *out) {
     CHECK_NULL(out);
-    *out = {1, nullptr, nullptr};
+    *out = {1, nullptr, nullptr, nullptr};
     return LC_OK;
 }
 
@@ -70,8 +70,7 @@ static lc_status init_steps(gcl *instance) {
     CHECK_CONDITION(lc_lock_init(&instance->lock, 1) == 0);
     ignore_sigpipe();
     CHECK_STATUS(gcl_admin_register(instance));
-    if (gcl_bn_init)
-        CHECK_STATUS(gcl_bn_init(instance));
+    CHECK_STATUS(gcl_bn_init(instance));
     return LC_OK;
 }
 
@@ -148,8 +147,7 @@ lc_status gcl_deinit(gcl **inout) {
             if (session)
                 LOG_STATUS(gcl_session_free(&session));
         }
-        if (bn_deinit)
-            LOG_STATUS(bn_deinit(instance));
+        LOG_STATUS(bn_deinit(instance));
     }
     while (gcl_session *session = instance->freed) {
         instance->freed = session->next;

@@ -9,6 +9,7 @@
 // until they are released. Any thread may send on a session that another thread's loop drives.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 
 #include <sys/socket.h>
@@ -50,6 +51,7 @@ enum : int32_t {
 // Instance.
 struct gcl_options {
     uint32_t options;
+    const std::atomic<int32_t> *ending; // null, or not 0 once no wait of this instance is to go on
     void *open_service_hook; // providers only
     void *open_service_argument;
 };
@@ -68,7 +70,7 @@ lc_status gcl_session_client_connect_by_sockaddr(gcl_session *session, const soc
 lc_status gcl_session_client_open_service(gcl_session *session, uint16_t protocol, int32_t service,
                                           const char *name, int32_t reserved);
 // `timeout_ms` -1 waits without limit. A wait, as one between attempts to connect, ends with LC_CANCELLED
-// when a signal that ends the process is pending on the calling thread.
+// when a signal that ends the process is pending on the calling thread, and once the instance is `ending`.
 lc_status gcl_session_client_open_service_blocking(gcl_session *session, uint16_t protocol, int32_t service,
                                                    const char *name, int32_t reserved, int64_t timeout_ms);
 lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int stop_on_frames_sent,
@@ -129,7 +131,6 @@ struct gcl_session_guard {
     lc_lock_guard session_lock;
 };
 
-// Body protocol 2, "bnode", registers itself from gcl_init and frees its state from gcl_deinit. A program
-// without it has sessions all the same.
-lc_status gcl_bn_init(gcl *instance) __attribute__((weak));
-lc_status bn_deinit(gcl *instance) __attribute__((weak));
+// Body protocol 2, "bnode": gcl_init registers it, gcl_deinit frees its state.
+lc_status gcl_bn_init(gcl *instance);
+lc_status bn_deinit(gcl *instance);

@@ -3,7 +3,8 @@
 //
 // The thread that waits here has its signals blocked, since its loop takes them only in a wait of its own. A
 // peer that never answers must not make the process deaf to the ones that end it: while one of them is
-// pending the wait ends with LC_CANCELLED, and the loop that the caller goes back to takes it.
+// pending the wait ends with LC_CANCELLED, and the loop that the caller goes back to takes it. A thread with
+// a loop of its own hears of the end from the one that takes the signals, by the `ending` of the instance.
 //
 // The interests of a round are a copy, and a callback may take away what a later entry of the copy stands
 // for. That does no harm: their functions look at the session, which outlives its interests.
@@ -18,7 +19,7 @@
 #include "runtime/ttime.h"
 
 constexpr int FD_MAX = 0x1ffff;
-constexpr int64_t SIGNAL_LOOK_MS = 500;
+constexpr int64_t END_LOOK_MS = 200;
 
 // What a caller can wait for a change of.
 struct gcl_watched {
@@ -58,7 +59,9 @@ static bool changed(const gcl_wait *wait, const gcl_watched *before) {
     return differs;
 }
 
-bool gcl_end_is_pending() {
+bool gcl_end_is_pending(const gcl *instance) {
+    if (instance->options.ending && *instance->options.ending)
+        return true;
     sigset_t pending;
     if (sigpending(&pending) != 0)
         return false;
@@ -144,7 +147,7 @@ static lc_status run_ready(const gcl_wait *wait, const fdic_event_array *events,
 static lc_status wait_round(gcl_wait *wait, bool *out_stop) {
     if (wait->session->state == GCL_SESSION_CLOSED || wait->session->fd < 0)
         return LC_IO_CLOSED;
-    if (gcl_end_is_pending())
+    if (gcl_end_is_pending(wait->instance))
         return LC_CANCELLED;
     owned<fdic_event_array, fdic_event_array_release> events;
     CHECK_STATUS(fdic_events_query(wait->instance->interests, &events.pointer));
@@ -158,8 +161,8 @@ static lc_status wait_round(gcl_wait *wait, bool *out_stop) {
     const int64_t left = time_left(wait);
     if (left < -1)
         return LC_IO_TIMED_OUT;
-    // No poll is longer than to the next timer or the next look for a signal.
-    const int64_t slice = next_timer >= 0 && next_timer < SIGNAL_LOOK_MS ? next_timer : SIGNAL_LOOK_MS;
+    // No poll is longer than to the next timer or the next look for an end.
+    const int64_t slice = next_timer >= 0 && next_timer < END_LOOK_MS ? next_timer : END_LOOK_MS;
     const bool sliced = left < 0 || slice < left;
     const int ready = poll(polled.pointer, count, static_cast<int>(sliced ? slice : left));
     if (ready == 0)
@@ -181,16 +184,16 @@ lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int st
     CHECK_NULL(instance);
     CHECK_NULL(session);
     const gcl_session_guard guard(session);
-    gcl_wait wait{};
-    wait.instance = instance;
-    wait.session = session;
-    wait.on_sent = stop_on_frames_sent;
-    wait.on_received = stop_on_frames_received;
-    wait.on_session_state = stop_on_session_state;
-    wait.on_protocol_state = stop_on_protocol_state;
-    wait.protocol = protocol;
-    wait.timeout_ms = timeout_ms;
-    wait.started_ms = lt_curr_time_ms();
+    gcl_wait wait = {instance,
+                     session,
+                     stop_on_frames_sent != 0,
+                     stop_on_frames_received != 0,
+                     stop_on_session_state != 0,
+                     stop_on_protocol_state != 0,
+                     protocol,
+                     timeout_ms,
+                     lt_curr_time_ms(),
+                     0};
     bool stop = false;
     while (!stop)
         CHECK_QUIET(wait_round(&wait, &stop));

@@ -51,16 +51,10 @@ void gcl_byte_swap_frame_header(void *header) {
 // ---- Sending
 
 static void fill_header(uint8_t *at, uint32_t sequence, uint16_t proto, uint16_t mtype, uint32_t total) {
-    gcl_frame_header header{};
+    gcl_frame_header header = {
+        {},    GCL_FRAME_MARKER,        GCL_FRAME_VERSION, total, GCL_HEADER_BYTES, 0, sequence, proto,
+        mtype, total - GCL_HEADER_BYTES};
     memcpy(header.ident, GCL_FRAME_IDENT, sizeof header.ident);
-    header.marker = GCL_FRAME_MARKER;
-    header.version = GCL_FRAME_VERSION;
-    header.total_length = total;
-    header.header_length = GCL_HEADER_BYTES;
-    header.sequence = sequence;
-    header.proto = proto;
-    header.mtype = mtype;
-    header.body_length = total - GCL_HEADER_BYTES;
     memcpy(at, &header, sizeof header);
 }
 
@@ -323,10 +317,6 @@ static lc_status reset_buffer(gcl_session *session) {
 
 // The next whole frame, copied; null when more has to come.
 static lc_status next_frame(gcl_session *session, tbuffer **out_frame) {
-    if (session->read_position && tb_avail(session->read_buffer) < GCL_READ_ROOM) {
-        CHECK_STATUS(tb_delete_bytes(session->read_buffer, 0, session->read_position));
-        session->read_position = 0;
-    }
     const uint32_t unread = bytes_unread(session);
     if (unread < GCL_HEADER_BYTES) {
         LC_LOG(LC_LOG_DEBUG, "session %d: bu: not enough for header", session->id);
@@ -370,10 +360,22 @@ static lc_status deliver_frames(gcl_session *session) {
     return LC_OK;
 }
 
-static lc_status read_activity(gcl_session *session) {
+// Room for a read. What has been delivered leaves the front of the buffer here, once for a read: between the
+// frames of one read it would cost a move of all that is left for each of them.
+static lc_status make_room(gcl_session *session) {
     tbuffer *buffer = session->read_buffer;
+    if (tb_avail(buffer) >= GCL_READ_ROOM)
+        return LC_OK;
+    CHECK_STATUS(tb_delete_bytes(buffer, 0, session->read_position));
+    session->read_position = 0;
     if (tb_avail(buffer) < GCL_READ_ROOM)
         CHECK_STATUS(tb_ensure_size(buffer, tb_size(buffer) + GCL_READ_ROOM));
+    return LC_OK;
+}
+
+static lc_status read_activity(gcl_session *session) {
+    tbuffer *buffer = session->read_buffer;
+    CHECK_STATUS(make_room(session));
     const auto length = static_cast<uint32_t>(tb_length(buffer));
     uint32_t room = static_cast<uint32_t>(tb_avail(buffer));
     room = room < GCL_READ_MAX ? room : GCL_READ_MAX;
