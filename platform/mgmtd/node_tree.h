@@ -7,13 +7,9 @@
 #include <string>
 #include <vector>
 
-#include "platform/mgmtd/schema.h"
+#include "platform/binding_text.h"
+#include "platform/schema.h"
 
-struct node_value {
-    uint32_t type;
-    std::string text;
-    friend bool operator==(const node_value &, const node_value &) = default;
-};
 using node_map = std::map<node_name, node_value>;
 
 struct node_tree {

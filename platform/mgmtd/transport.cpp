@@ -30,6 +30,7 @@
 #include "mgmt/bnode_proto.h"
 #include "mgmt/gcl.h"
 #include "mgmt/gcl_wire.h"
+#include "platform/provider_path.h"
 
 static constexpr const char *PROVIDER_NAME = "mgmtd";
 static constexpr int READS_A_TURN = 16; // then the others have theirs
@@ -69,9 +70,7 @@ bool transport_listen(transport *self, server *owner, std::string *out_error) {
     owner->send = [self](uint32_t id, uint16_t mtype, tbuffer *frame) { send_bnode(self, id, mtype, frame); };
     if (!open_directory(self, out_error))
         return false;
-    const bool development = getenv("PROD_DEV") != nullptr;
-    self->socket_path = std::string(GCL_SOCKET_DIRECTORY) + "uds-provider-" +
-                        (development ? "UID-" + std::to_string(geteuid()) + "-" : "") + PROVIDER_NAME;
+    self->socket_path = provider_path();
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     strlcpy(address.sun_path, self->socket_path.c_str(), sizeof address.sun_path);

@@ -1,5 +1,6 @@
 // What may stand in the configuration: one row for each kind of node. "*" in a pattern is a part that the
-// operator chooses. Everything that mgmtd knows of a node, it knows from its row.
+// operator chooses. Everything that mgmtd knows of a node, it knows from its row; mgmtctl helps out of the
+// same.
 #pragma once
 
 #include <compare>
@@ -41,4 +42,3 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
                  std::string *out_reason);
 // Text of one type into the form that the type's own conversion gives.
 bool canonical_text(uint32_t type, const std::string &text, std::string *out_text);
-const char *type_name(uint32_t type);

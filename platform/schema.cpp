@@ -7,13 +7,14 @@
 // Defaults are given so that a group of which only the interface and the routers are said takes part. A text
 // that may be empty has the empty text as default, because a node that is deleted and has no default takes
 // its whole group out of the daemon.
-#include "platform/mgmtd/schema.h"
+#include "platform/schema.h"
 
 #include <algorithm>
 #include <cstring>
 
 #include "mgmt/bnode.h"
 #include "mgmt/owners.h"
+#include "platform/binding_text.h"
 #include "runtime/logging.h"
 
 static const char *check_level(const std::string &text) {
@@ -202,10 +203,6 @@ const schema_row *find_schema_row(const node_name &name) {
 }
 
 // --- Values
-
-const char *type_name(uint32_t type) {
-    return lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(type));
-}
 
 bool canonical_text(uint32_t type, const std::string &text, std::string *out_text) {
     if (text.find('\0') != std::string::npos)
