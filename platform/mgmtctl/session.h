@@ -1,6 +1,7 @@
 // One session of mgmtctl with mgmtd: requests that wait for their answers, and events as they come.
 #pragma once
 
+#include <csignal>
 #include <cstdint>
 #include <functional>
 #include <string>
@@ -32,6 +33,10 @@ struct ctl_change_item {
     ctl_binding binding; // removed and reset ones need only the name; a type left empty is sent as a string
 };
 
+// Set by the program's handlers of SIGINT, SIGTERM and SIGHUP, 0 until then. Once it is set no wait goes on,
+// and a request fails with "interrupted". These signals are best blocked: a wait opens them.
+extern volatile std::sig_atomic_t ctl_stop_signal;
+
 struct ctl_session; // owned by whoever opened it
 
 // Null, with the reason, when mgmtd isn't there, refuses, or doesn't answer in time. All waits of the session
@@ -40,15 +45,16 @@ ctl_session *ctl_open(int64_t timeout_ms, std::string *out_reason);
 void ctl_close(ctl_session *session);
 
 // False, with the reason, when no answer came: the session is of no use then.
-bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason);
+bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out,
+               std::string *out_reason);
 // One commit.
 bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, ctl_reply *out,
              std::string *out_reason);
 bool ctl_action(ctl_session *session, const std::string &name, const std::vector<ctl_binding> &bindings,
                 ctl_reply *out, std::string *out_reason);
 // Asks for an event, only with a binding that matches one of the patterns when there are any.
-bool ctl_add_interest(ctl_session *session, const std::string &event, const std::vector<std::string> &patterns,
-                      std::string *out_reason);
-// Waits for the next event, also one that came during a request. 1: it is here; 0: none within `wait_ms` (-1: no
-// limit); -1: the session has ended, with the reason. A signal that a handler takes ends the wait with 0.
+bool ctl_add_interest(ctl_session *session, const std::string &event,
+                      const std::vector<std::string> &patterns, std::string *out_reason);
+// Waits for the next event, also one that came during a request. 1: it is here; 0: none within `wait_ms` (-1:
+// no limit); -1: the session has ended, with the reason. A signal that a handler takes ends the wait with 0.
 int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason);
