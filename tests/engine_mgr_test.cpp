@@ -3,7 +3,6 @@
 
 #include "engine/wccp_mgr.h"
 
-#include <dlfcn.h>
 #include <gtest/gtest.h>
 #include <pthread.h>
 #include <sched.h>
@@ -11,10 +10,7 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cstring>
-#include <fstream>
-#include <new>
 #include <string>
 
 #include "engine/cthread.h"
@@ -38,23 +34,6 @@ int qv_start_netlink_monitor(uint32_t) {
 
 namespace {
 
-int threads_named(const std::string &wanted) {
-    int count = 0;
-    for (int i = 0; i < 100; i++) { // a thread gives itself its name
-        count = 0;
-        const std::string command = "cat /proc/" + std::to_string(getpid()) + "/task/*/comm";
-        FILE *names = popen(command.c_str(), "r");
-        char line[64];
-        while (fgets(line, sizeof line, names))
-            count += std::string(line) == wanted + "\n";
-        pclose(names);
-        if (count)
-            break;
-        usleep(1000);
-    }
-    return count;
-}
-
 class Manager : public testing::Test {
 protected:
     void SetUp() override {
@@ -70,10 +49,8 @@ protected:
         EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
     }
     static wccp_service_group *add_group(uint8_t id, uint32_t admin) {
-        wccp_grp_config config = {};
-        config.group_id = id;
+        wccp_grp_config config = engine_fixture::group_config(id, {});
         config.admin = admin;
-        config.compatibility = WCCP_COMPAT_IOS;
         strlcpy(config.interface, "lo", sizeof config.interface);
         EXPECT_EQ(wccp_add_group(&config), 0);
         return wccp_find_group(id);
@@ -85,15 +62,13 @@ TEST_F(Manager, StartsThreadsMailboxAndPrimaryInterface) {
     ASSERT_EQ(wccp_init_mgr(), 0);
     EXPECT_LT(wccp_g.seconds, 10u);
     EXPECT_EQ(wccp_g.mcast_ttl, 5);
-    EXPECT_EQ(wccp_g.track_primary, 0u);
     ASSERT_NE(wccp_g.primary_if, nullptr);
     EXPECT_STREQ(wccp_g.primary_if->name, "lo");
     EXPECT_EQ(wccp_g.interfaces[126].ucast_fd, -1);
     EXPECT_NE(wccp_mailbox, nullptr);
-    EXPECT_GE(g_qvif_skfd, 0);
     EXPECT_EQ(threads_named("WCCP_TIMER"), 1);
     EXPECT_EQ(threads_named("WCCP_RX_lo"), 1);
-    wccp_service_group *zero = add_group(0, WCCP_ADMIN_DOWN);
+    const wccp_service_group *zero = add_group(0, WCCP_ADMIN_DOWN);
     EXPECT_EQ(wccp_find_group(256), zero);
     EXPECT_EQ(wccp_find_group(1), nullptr);
 }
@@ -105,29 +80,21 @@ TEST_F(Manager, ALinkManagerThatFailsIsNoFailure) {
     EXPECT_EQ(wccp_init_mgr(), 0);
 }
 
-TEST_F(Manager, InBridgeModeTheClockStandsStill) {
+TEST_F(Manager, InBridgeModeNobodyTicksButReceiversRun) {
     test_host_bridge_mode = 1;
     ASSERT_EQ(wccp_init_mgr(), 0);
     EXPECT_EQ(threads_named("WCCP_RX_lo"), 1) << "an interface with an address has its receive thread";
-    usleep(1300000);
-    EXPECT_EQ(wccp_g.seconds, 0u);
     EXPECT_EQ(threads_named("WCCP_TIMER"), 0);
-}
-
-TEST_F(Manager, TheTickRunsEnabledGroupsUntilShutdown) {
-    test_host_bridge_mode = 1; // time is turned by hand
-    ASSERT_EQ(wccp_init_mgr(), 0);
+    // A tick by hand: enabled groups only, and nothing once an exit has begun.
     wccp_service_group *up = add_group(1, WCCP_ADMIN_UP), *down = add_group(2, WCCP_ADMIN_DOWN);
     down->monitor_timer = up->monitor_timer;
     wccp_tick();
     wccp_tick();
-    EXPECT_EQ(wccp_g.seconds, 2u);
-    EXPECT_EQ(up->monitor_timer.countdown, 3u);
-    EXPECT_EQ(down->monitor_timer.countdown, 5u);
     wccpd_exiting = 1;
     wccp_tick();
     EXPECT_EQ(wccp_g.seconds, 2u);
     EXPECT_EQ(up->monitor_timer.countdown, 3u);
+    EXPECT_EQ(down->monitor_timer.countdown, 5u);
 }
 
 TEST_F(Manager, OnlyBridgeModeStopsTheEngine) {
@@ -143,9 +110,8 @@ TEST_F(Manager, OnlyBridgeModeStopsTheEngine) {
     EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0);
     EXPECT_EQ(group->hia_timer.active, 0);
     EXPECT_EQ(group->admin_state, WCCP_ADMIN_UP);
+    EXPECT_EQ(wccp_system_mode_change_event("router"), 0) << "nothing starts them again";
     EXPECT_EQ(threads_named("WCCP_TIMER") + threads_named("WCCP_RX_lo"), 0);
-    EXPECT_EQ(wccp_system_mode_change_event("router"), 0);
-    EXPECT_EQ(threads_named("WCCP_TIMER"), 0) << "nothing starts them again";
 }
 
 TEST_F(Manager, AllocationsAreZeroedAndCounted) {
@@ -169,28 +135,26 @@ TEST_F(Manager, AllocationsAreZeroedAndCounted) {
 }
 
 TEST(Text, SecondsBecomeDaysHoursMinutesSeconds) {
-    char text[128];
-    wccp_seconds_to_str(90061, text, sizeof text);
-    EXPECT_STREQ(text, "1:1:1:1");
-    wccp_seconds_to_str(0xffffffff, text, sizeof text);
-    EXPECT_STREQ(text, "49710:6:28:15");
-    for (const uint32_t short_one : {31u, 0u, 256u, 256u + 31}) {
+    const struct {
+        uint32_t seconds, length;
+        const char *text;
+    } rows[] = {{90061, 128, "1:1:1:1"}, {0xffffffff, 128, "49710:6:28:15"}, {59, 256 + 32, "0:0:0:59"},
+                {1, 31, "as it was"},    {1, 256 + 31, "as it was"},         {1, 256, "as it was"}};
+    char text[512];
+    for (const auto &row : rows) {
         strlcpy(text, "as it was", sizeof text);
-        wccp_seconds_to_str(1, text, short_one);
-        EXPECT_STREQ(text, "as it was");
+        wccp_seconds_to_str(row.seconds, text, row.length);
+        EXPECT_STREQ(text, row.text);
     }
-    wccp_seconds_to_str(59, text, 256 + 32);
-    EXPECT_STREQ(text, "0:0:0:59");
     wccp_seconds_to_str(1, nullptr, 128);
 }
 
 struct birth {
-    std::atomic<int> runs = 0;
     size_t stack = 0;
     sigset_t blocked;
     cpu_set_t cpus;
-    int nice = 0;
-    std::atomic<void *> ended = nullptr;
+    int runs = 0, nice = 0;
+    void *ended = nullptr;
 };
 
 void *look_around(void *argument) {
@@ -218,10 +182,8 @@ TEST(Thread, IsBornBoundSmallAndDeafToSignals) {
                                     SCHED_OTHER, 3, 0, 7);
     ASSERT_NE(context, nullptr);
     EXPECT_EQ(strlen(context->name), 63u);
-    EXPECT_EQ(context->max_wait, 7u);
     ASSERT_EQ(cthread_start(context), 0);
-    EXPECT_EQ(context->listed, 1);
-    EXPECT_NE(context->heartbeat, 0u);
+    EXPECT_TRUE(context->listed == 1 && context->heartbeat != 0);
     cthread_join(context);
     EXPECT_EQ(seen.runs, 1);
     EXPECT_EQ(seen.ended, &seen) << "the end function ran behind the body";
@@ -231,29 +193,27 @@ TEST(Thread, IsBornBoundSmallAndDeafToSignals) {
 #endif
     for (const int number : {SIGHUP, SIGINT, SIGTERM, SIGPIPE, SIGUSR1, SIGUSR2})
         EXPECT_EQ(sigismember(&seen.blocked, number), 1) << number;
-    EXPECT_EQ(CPU_COUNT(&seen.cpus), 1);
-    EXPECT_TRUE(CPU_ISSET(0, &seen.cpus));
+    EXPECT_TRUE(CPU_COUNT(&seen.cpus) == 1 && CPU_ISSET(0, &seen.cpus));
     sigset_t own;
     pthread_sigmask(SIG_BLOCK, nullptr, &own);
     EXPECT_EQ(sigismember(&own, SIGTERM), 0) << "the caller's mask is as it was";
-}
 
-TEST(Thread, IsNotStoppedByAPlaceThatItCannotHave) {
-    birth seen;
-    cthread *context = cthread_init("astray", look_around, &seen, nullptr, nullptr, SCHED_OTHER, 0, 128, 0);
+    // A place that it cannot have doesn't stop it.
+    context = cthread_init("astray", look_around, &seen, nullptr, nullptr, SCHED_OTHER, 0, 128, 0);
     ASSERT_EQ(cthread_start(context), 0);
     cthread_join(context);
-    EXPECT_EQ(seen.runs, 1);
+    EXPECT_EQ(seen.runs, 2);
 }
 
 TEST(Thread, WithoutABodyOrAStartEnds) {
-    cthread *empty = cthread_init("empty", nullptr, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);
+    const auto make = [](uint32_t policy) {
+        return cthread_init("empty", nullptr, nullptr, nullptr, nullptr, policy, 0, 0, 0);
+    };
+    cthread *empty = make(SCHED_OTHER), *idle = make(SCHED_OTHER), *refused = make(77);
     ASSERT_EQ(cthread_start(empty), 0);
     cthread_join(empty);
-    cthread *idle = cthread_init("idle", nullptr, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);
     cthread_cancel(idle);
     cthread_join(idle);
-    cthread *refused = cthread_init("refused", nullptr, nullptr, nullptr, nullptr, 77, 0, 0, 0);
     EXPECT_EQ(cthread_start(refused), 1);
     EXPECT_EQ(refused->listed, 0);
     cthread_join(refused);
@@ -267,12 +227,11 @@ void *sleep_for_ever(void *) {
 }
 
 TEST(Thread, AllOfThemAreCancelledBeforeOneIsWaitedFor) {
-    for (int i = 0; i < 20; i++)
-        ASSERT_EQ(cthread_start(cthread_init("sleeper", sleep_for_ever, nullptr, nullptr, nullptr,
-                                             SCHED_OTHER, 0, 0, 0)),
-                  0);
-    cthread *one = cthread_init("single", sleep_for_ever, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);
-    ASSERT_EQ(cthread_start(one), 0);
+    cthread *one = nullptr;
+    for (int i = 0; i < 21; i++) {
+        one = cthread_init("sleeper", sleep_for_ever, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);
+        ASSERT_EQ(cthread_start(one), 0);
+    }
     cthread_cancel(one);
     EXPECT_EQ(one->listed, 0);
     cthread_join(one);
