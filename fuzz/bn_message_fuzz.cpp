@@ -1,0 +1,218 @@
+// The bodies of management messages, requests and responses, as a peer may have made them.
+//
+// An input is a mode byte and then a message from its service id on. Whatever of it can be read takes memory
+// in proportion to its bytes and keeps attributes at valid ids only; written and read again it is the same
+// message. Then it goes through those who look at messages: readers by copy and by takeover, the dump, the
+// answer to a monitoring query, the change event and the walk by pattern.
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+
+#include <sanitizer/allocator_interface.h>
+
+#include "mgmt/bnode_proto.h"
+#include "mgmt/mdc_main.h"
+#include "mgmt/owners.h"
+#include "runtime/logging.h"
+
+namespace {
+
+enum mode : uint8_t {
+    RESPONSE = 1,
+    LOGGED = 2, // every line is written, and costs most of the time
+    OFFSET_SHIFT = 6,
+};
+// The dearest bytes are those of an attribute with the last id, whose array has a place for each id below.
+constexpr size_t BYTES_FOR_A_BYTE = 48, BYTES_FOR_A_MESSAGE = 1024;
+
+void require(bool condition, const char *what) {
+    if (condition)
+        return;
+    fprintf(stderr, "the message is not as it should be: %s\n", what);
+    abort();
+}
+#define REQUIRE(condition) require((condition), #condition)
+
+lc_status read(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
+    return bn_request_msg_deserialize(buffer, offset, out);
+}
+lc_status read(const tbuffer *buffer, uint32_t offset, bn_response_msg **out) {
+    return bn_response_msg_deserialize(buffer, offset, out);
+}
+lc_status write(bn_request_msg *msg, tbuffer **out) {
+    return bn_request_msg_serialize(msg, 0, out);
+}
+lc_status write(bn_response_msg *msg, tbuffer **out) {
+    return bn_response_msg_serialize(msg, 0, out);
+}
+uint32_t count_of(const bn_request_msg *msg) {
+    return bn_request_per_node_array_length_quick(msg->nodes);
+}
+uint32_t count_of(const bn_response_msg *msg) {
+    return bn_response_per_node_array_length_quick(msg->nodes);
+}
+const bn_request_node *node_of(const bn_request_msg *msg, uint32_t index) {
+    return bn_request_per_node_array_get_quick(msg->nodes, index);
+}
+const bn_response_node *node_of(const bn_response_msg *msg, uint32_t index) {
+    return bn_response_per_node_array_get_quick(msg->nodes, index);
+}
+std::string text_of(const tstring *text) {
+    return text ? std::string(text->buffer, static_cast<size_t>(text->length)) : std::string();
+}
+bool same_beside_nodes(const bn_request_msg *a, const bn_request_msg *b) {
+    return a->transaction_id == b->transaction_id && a->flags == b->flags && a->number == b->number &&
+           text_of(a->text) == text_of(b->text) && text_of(a->audit_user) == text_of(b->audit_user);
+}
+bool same_beside_nodes(const bn_response_msg *a, const bn_response_msg *b) {
+    return a->response_to == b->response_to && a->return_code == b->return_code &&
+           a->db_revision_id == b->db_revision_id && text_of(a->return_message) == text_of(b->return_message);
+}
+bool same_beside_binding(const bn_request_node *a, const bn_request_node *b) {
+    return a->subop == b->subop && a->flags == b->flags && text_of(a->source) == text_of(b->source) &&
+           text_of(a->target) == text_of(b->target);
+}
+bool same_beside_binding(const bn_response_node *, const bn_response_node *) {
+    return true;
+}
+
+void check_binding(const bn_binding *binding) {
+    REQUIRE(binding && binding->name && binding->parts);
+    const bn_attrib_array *attributes = binding->attributes;
+    REQUIRE(bn_attrib_array_length_quick(attributes) <= BN_ATTRIB_LAST + 1);
+    REQUIRE(!attributes || attributes->list->capacity <= 2 * (BN_ATTRIB_LAST + 10));
+    for (uint32_t id = 0; id < bn_attrib_array_length_quick(attributes); id++)
+        if (const bn_attrib *attribute = bn_attrib_array_get_quick(attributes, id)) {
+            REQUIRE(attribute->attribute_id == id && bn_attrib_id_valid(id));
+            REQUIRE(bn_type_known(attribute->type) && (attribute->type_flags & BN_TYPE_MASK) == 0);
+        }
+}
+
+void check_same(const bn_binding *a, const bn_binding *b) {
+    REQUIRE(text_of(a->name) == text_of(b->name) && a->absolute == b->absolute);
+    REQUIRE(tstr_array_equal(a->parts, b->parts));
+    const uint32_t slots = bn_attrib_array_length_quick(a->attributes);
+    REQUIRE(slots == bn_attrib_array_length_quick(b->attributes));
+    for (uint32_t id = 0; id < slots; id++) {
+        const bn_attrib *left = bn_attrib_array_get_quick(a->attributes, id);
+        const bn_attrib *right = bn_attrib_array_get_quick(b->attributes, id);
+        int order = 1;
+        REQUIRE(bn_attrib_compare(left, right, &order) == LC_OK && (order == 0 || (!left && !right)));
+        REQUIRE(!left || (left->type_flags == right->type_flags && left->value_size == right->value_size));
+    }
+}
+
+// Reads the message, and writes it and reads it again.
+template <typename Message, typename Owner>
+bool read_message(const tbuffer *buffer, uint32_t offset, Owner *out) {
+    const size_t before = __sanitizer_get_current_allocated_bytes();
+    const lc_status status = read(buffer, offset, &out->pointer);
+    const size_t taken = __sanitizer_get_current_allocated_bytes() - before;
+    if (status != LC_OK) {
+        REQUIRE(!out->pointer);
+        return false;
+    }
+    REQUIRE(taken <= BYTES_FOR_A_BYTE * buffer->length + BYTES_FOR_A_MESSAGE);
+    Message *msg = out->pointer;
+    for (uint32_t i = 0; i < count_of(msg); i++)
+        check_binding(node_of(msg, i)->binding);
+
+    owned_tbuffer written, again;
+    Owner copy;
+    REQUIRE(write(msg, &written.pointer) == LC_OK);
+    REQUIRE(msg->length == written.pointer->length && msg->length <= buffer->length);
+    REQUIRE(read(written.pointer, 0, &copy.pointer) == LC_OK);
+    REQUIRE(write(copy.pointer, &again.pointer) == LC_OK);
+    REQUIRE(written.pointer->length == again.pointer->length);
+    REQUIRE(memcmp(written.pointer->buffer, again.pointer->buffer, again.pointer->length) == 0);
+    REQUIRE(msg->msg_type == copy.pointer->msg_type && msg->msg_id == copy.pointer->msg_id);
+    REQUIRE(same_beside_nodes(msg, copy.pointer) && count_of(msg) == count_of(copy.pointer));
+    for (uint32_t i = 0; i < count_of(msg); i++) {
+        REQUIRE(node_of(msg, i)->node_id == node_of(copy.pointer, i)->node_id);
+        REQUIRE(same_beside_binding(node_of(msg, i), node_of(copy.pointer, i)));
+        check_same(node_of(msg, i)->binding, node_of(copy.pointer, i)->binding);
+    }
+    return true;
+}
+
+lc_status get_one(const char *name, const tstr_array *, void *, bn_binding_array *out) {
+    owned_binding binding;
+    CHECK_STATUS(bn_binding_new_uint32(&binding.pointer, name, bn_attrib_value, 0, 1));
+    CHECK_STATUS(bn_binding_array_append_takeover(out, &binding.pointer));
+    return LC_OK;
+}
+// Few children, and none below the third level: each wildcard multiplies them.
+lc_status list_children(const char *, const tstr_array *parts, void *, tstr_array *out) {
+    if (tstr_array_length_quick(parts) > 2)
+        return LC_OK;
+    for (const char *child : {"1", "a/b"})
+        CHECK_STATUS(tstr_array_append_str(out, child));
+    return LC_OK;
+}
+lc_status note(const bn_binding_array *, uint32_t, bn_binding *, const tstring *, const tstr_array *,
+               const tstring *, const tstring *, void *) {
+    return LC_OK;
+}
+
+void use_bindings(bn_binding_array *bindings) {
+    owned_bindings before, after;
+    (void)mdc_foreach_binding_prequeried(bindings, "/a/**", nullptr, note, nullptr, nullptr);
+    const lc_status status = mdc_event_config_change_notif_extract(bindings, &before.pointer, &after.pointer);
+    REQUIRE((status == LC_OK) == (before.pointer != nullptr && after.pointer != nullptr));
+}
+
+void use_request(const tbuffer *buffer, uint32_t offset) {
+    owned_request msg;
+    if (!read_message<bn_request_msg>(buffer, offset, &msg))
+        return;
+    bn_request_msg_dump(nullptr, msg.pointer, LC_LOG_DEBUG, "FUZZ");
+    uint16_t type = 0;
+    owned_bindings bindings;
+    owned_uint32_array ids;
+    owned_node_info info;
+    if (bn_request_get(msg.pointer, &type, nullptr, 1, &bindings.pointer, &ids.pointer, &info.pointer) !=
+        LC_OK)
+        return;
+    REQUIRE(bn_binding_array_length_quick(bindings.pointer) == count_of(msg.pointer));
+    REQUIRE(uint32_array_length_quick(ids.pointer) == count_of(msg.pointer));
+    if (type == bn_msg_query_request)
+        (void)mdc_dispatch_mon_request(nullptr, msg.pointer, get_one, nullptr, list_children, nullptr);
+    else
+        use_bindings(bindings.pointer);
+}
+
+void use_response(const tbuffer *buffer, uint32_t offset) {
+    owned_response msg, copy;
+    if (!read_message<bn_response_msg>(buffer, offset, &msg))
+        return;
+    bn_response_msg_dump(nullptr, msg.pointer, LC_LOG_DEBUG, "FUZZ");
+    REQUIRE(bn_response_msg_dup(msg.pointer, &copy.pointer) == LC_OK);
+    for (const bool take : {false, true}) {
+        owned_bindings bindings;
+        owned_uint32_array ids;
+        uint32_t code = 0;
+        const lc_status status =
+            take ? bn_response_get_takeover(copy.pointer, &code, nullptr, 0, &bindings.pointer, &ids.pointer)
+                 : bn_response_get(copy.pointer, &code, nullptr, 1, &bindings.pointer, &ids.pointer);
+        REQUIRE(status == LC_OK);
+        REQUIRE(code == msg.pointer->return_code);
+        REQUIRE(bn_binding_array_length_quick(bindings.pointer) == count_of(msg.pointer));
+        use_bindings(bindings.pointer);
+    }
+}
+
+} // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t *input, size_t size);
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t *input, size_t size) {
+    if (size < 1 || size > 1u << 20)
+        return 0;
+    const uint8_t mode = *input;
+    const uint32_t offset = mode >> OFFSET_SHIFT; // any alignment
+    G_log_level = mode & LOGGED ? LC_LOG_DEBUG : -1;
+    owned_tbuffer buffer;
+    REQUIRE(tb_new_buf_const(&buffer.pointer, input + 1, static_cast<uint32_t>(size - 1)) == LC_OK);
+    (mode & RESPONSE ? use_response : use_request)(buffer.pointer, offset);
+    return 0;
+}
