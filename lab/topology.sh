@@ -6,10 +6,35 @@
 #     lab_enter "$0" "$@"                     # from here on the script runs inside; nothing outlives it
 #     lab_router r1 10.0.0.1 -- --form nexus  # wccp_router on that address, its control socket and its log
 #     lab_appliance a1 10.0.0.101             # namespaces and a log daemon; no program yet
-#     lab_start a1 host wccp_engine_host a.conf
+#     lab_appliance_start a1 "$(lab_group 51 10.0.0.1 weight=7)"      # mgmtd, tunneld and wccpd, each ready
+#     lab_wait_role 30 a1 51 ACTIVE
 #     lab_wait 30 '.groups["51"].assignment.kind == "hash"' lab_ctl r1 show
+#     lab_configure a1 "$(lab_group 51 10.0.0.1 weight=9)"            # all of the configuration anew
+#     lab_end a1                              # stopped in order; nothing is left
+#     lab_clean_log a1 'a line at error level that is explained'
 # As a command:
 #     topology.sh [--routers N] [--appliances N] [COMMAND...]    a network to try things in; a shell without COMMAND
+#
+# Of an appliance, its programs and what they tell (NODE is a name such as a1):
+#     lab_appliance NODE ADDRESS...           namespaces; `lab_kill NODE` is the loss of its power
+#     lab_group ID [ROUTER]... [NAME=VALUE]...    prints a group's section; interface eth0 unless told
+#     lab_appliance_start NODE [TEXT]...      with that configuration: any lines of mgmtd's file (docs/mgmtd.md)
+#     lab_configure NODE [TEXT]...            writes it anew, whole, and waits until mgmtd has taken it (1: refused)
+#     lab_mgmtd_start NODE, lab_wccpd_start NODE    one of them again, until it is ready
+#     lab_manage NODE WORDS...                mgmtctl --json WORDS inside the appliance
+#     lab_events NODE                         the lines of mgmtd since its start: sessions, commits, alarms, roles
+#     lab_role NODE GROUP                     the role that was last reported: ACTIVE, BACKUP, UNKNOWN
+#     lab_wait_role SECONDS NODE GROUP ROLE
+#     lab_wait_event SECONDS NODE EXPRESSION  a line of mgmtd's
+#     lab_wait_log SECONDS NODE EXPRESSION    a line of the log (grep -E); what stood there before lab_mark NODE
+#     lab_mark NODE                           doesn't count
+#     lab_log NODE                            the log since lab_mark
+#     lab_start NODE NAME PROGRAM..., lab_stop NODE NAME [SIGNAL], lab_alive NODE NAME, lab_pid NODE NAME
+#                                             one program: NAME is mgmtd, tunneld or wccpd
+#     lab_wait_exit SECONDS NODE NAME         waits until it ends by itself; its status, or 124
+#     lab_end NODE...                         SIGTERM to wccpd, tunneld and mgmtd in turn, each ends with 0 (or has
+#                                             ended before), and no process, segment, socket or interface is left
+#     lab_clean_log NODE [EXPRESSION...]      no line at error level or worse but those, no finding of a sanitizer
 #
 # How it holds together: lab_enter runs the script again as the first process of its own process, mount and network
 # namespaces (and of a user namespace, when started by an ordinary user). Every other namespace is held by a process
@@ -19,11 +44,18 @@
 #
 #   WCCP_BIN    where the programs are (default: build/release/bin)
 #   LAB_KEEP    a directory to which logs are copied when the script ends by itself
+#   LAB_SPEED   how many of its seconds the protocol gets into one (default 1); wccpd, tunneld and wccp_router run by
+#               that clock (lab/fast_clock.cpp), mgmtd and mgmtctl, whose limits are about work, by the wall's.
+#               SECONDS of all functions here are the wall's, but for lab_sleep, which sleeps for the protocol's.
+#   LAB_LOG_LEVEL   of wccpd, in the configuration that lab_appliance_start writes (default info)
 
 LAB_HOME=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
 LAB_TOP=$(dirname "$LAB_HOME")
 : "${WCCP_BIN:=$LAB_TOP/build/release/bin}"
-declare -A LAB_INIT LAB_PID # first process of an appliance; programs as NODE/NAME
+: "${LAB_SPEED:=1}" "${LAB_LOG_LEVEL:=info}"
+LAB_CONFIG=/etc/opt/rvl/mgmtd.conf # inside an appliance
+declare -A LAB_INIT LAB_PID        # first process of an appliance; programs as NODE/NAME
+declare -A LAB_MARKED LAB_FOUND    # lines of the log that don't count; what an appliance held before its programs
 
 lab_die() { echo "lab: $*" >&2; exit 1; }
 
@@ -117,7 +149,8 @@ lab_router() { # NAME ADDRESS... [-- OPTIONS OF wccp_router]
 }
 lab_route_start() { # NAME OPTIONS... : (again) after lab_stop NAME router
     local node=$1; shift
-    nsenter -t "${LAB_INIT[$node]}" --net "$WCCP_BIN/wccp_router" --control "$LAB/$node.ctl" --json "$@" \
+    lab_clock
+    nsenter -t "${LAB_INIT[$node]}" --net "${LAB_CLOCK[@]}" "$WCCP_BIN/wccp_router" --control "$LAB/$node.ctl" --json "$@" \
         </dev/null >>"$LAB/$node.log" 2>&1 &
     LAB_PID[$node/router]=$!
     local i
@@ -157,12 +190,26 @@ lab_in() { # NAME COMMAND...
     (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net "${all[@]}" "$@")
 }
 
+# What a program is started with to run by the clock of the protocol: LAB_CLOCK.
+lab_clock() {
+    LAB_CLOCK=()
+    [ "$LAB_SPEED" = 1 ] || LAB_CLOCK=(env "LD_PRELOAD=$(dirname "$WCCP_BIN")/lib/libfast_clock.so" "FAST_CLOCK=$LAB_SPEED"
+        "ASAN_OPTIONS=${ASAN_OPTIONS:+$ASAN_OPTIONS:}verify_asan_link_order=0")
+}
+lab_sleep() { # SECONDS of the protocol
+    sleep "$(awk "BEGIN { print $1 / $LAB_SPEED }")"
+}
+
 # Starts a program inside an appliance; a bare name is one of ours. Its output goes to $LAB/NODE-NAME.out.
 lab_start() { # NODE NAME PROGRAM ARGUMENTS...
     local node=$1 name=$2 program=$3; shift 3
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
-    case $program in */*) ;; *) program=$WCCP_BIN/$program ;; esac
-    (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net --mount --root --ipc --pid "$program" "$@") \
+    case $program in
+    */*) ;;
+    mgmtd) program=$WCCP_BIN/$program; LAB_CLOCK=() ;;
+    *) program=$WCCP_BIN/$program; lab_clock ;;
+    esac
+    (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net --mount --root --ipc --pid "${LAB_CLOCK[@]}" "$program" "$@") \
         </dev/null >>"$LAB/$node-$name.out" 2>&1 &
     LAB_PID[$node/$name]=$!
 }
@@ -184,6 +231,15 @@ lab_stop() { # NODE NAME [SIGNAL]
     [ -n "$inner" ] && kill -s "${3-TERM}" $inner
     for i in $(seq 300); do
         kill -0 "$pid" 2>/dev/null || { wait "$pid"; return; }
+        sleep 0.05
+    done
+    return 124
+}
+# Waits for a program to end without being told to: its status, or 124.
+lab_wait_exit() { # SECONDS NODE NAME
+    local i
+    for ((i = 0; i < $1 * 20; i++)); do
+        lab_alive "$2" "$3" || { wait "${LAB_PID[$2/$3]}"; return; }
         sleep 0.05
     done
     return 124
@@ -231,6 +287,147 @@ lab_wait_line() { # SECONDS EXPRESSION FILE
     done
 }
 
+# ---- the programs of an appliance
+
+lab_group() { # ID [ROUTER]... [NAME=VALUE]...
+    local word n=0
+    printf '[/qv/wccpd/wccp/srv_grp/config/%s]\n' "$1"; shift
+    [[ " $*" = *' interface='* ]] || echo 'interface = eth0'
+    for word; do
+        case $word in *=*) echo "${word%%=*} = ${word#*=}" ;; *) n=$((n + 1)); echo "router/$n/ipaddr = $word" ;; esac
+    done
+}
+
+lab_write_config() { # NODE [TEXT]...
+    local file=/proc/${LAB_INIT[$1]}/root$LAB_CONFIG
+    shift
+    printf '%s\n' '[/logging/syslog/process/wccpd]' "log_level = $LAB_LOG_LEVEL" "$@" >"$file.new" &&
+        mv "$file.new" "$file"
+}
+
+lab_appliance_start() { # NODE [TEXT]...
+    local node=$1
+    lab_write_config "$@" || lab_die "no configuration for $node"
+    LAB_FOUND[$node]=$(lab_remains "$node")
+    lab_mgmtd_start "$node"
+    lab_start "$node" tunneld tunneld
+    lab_wccpd_start "$node"
+}
+lab_mgmtd_start() { # NODE
+    : >"$LAB/$1-mgmtd.out"
+    lab_start "$1" mgmtd mgmtd --config $LAB_CONFIG
+    lab_wait_event 20 "$1" '^mgmtd ready' || lab_show_and_die "$1" "mgmtd of $1 does not start"
+}
+lab_wccpd_start() { # NODE
+    local before
+    before=$(grep -c 'wccpd_init: encap entries:' "$LAB/$1.log")
+    lab_start "$1" wccpd wccpd
+    local i
+    for ((i = 0; i < 600; i++)); do
+        [ "$(grep -c 'wccpd_init: encap entries:' "$LAB/$1.log")" -gt "$before" ] && return
+        lab_alive "$1" wccpd || break
+        sleep 0.05
+    done
+    lab_show_and_die "$1" "wccpd of $1 does not start"
+}
+lab_show() { # NODE : what it has said last
+    tail -n 40 "$LAB/$1.log" "$LAB/$1"-*.out >&2
+}
+lab_show_and_die() { # NODE TEXT
+    lab_show "$1"
+    lab_die "$2"
+}
+
+lab_configure() { # NODE [TEXT]...
+    local before now i
+    before=$(lab_events "$1" | wc -l)
+    lab_write_config "$@" || return
+    kill -HUP "$(lab_pid "$1" mgmtd)"
+    for ((i = 0; i < 200; i++)); do
+        now=$(lab_events "$1" | tail -n +$((before + 1)))
+        [[ $now != *'configuration read again: '* ]] || return 0
+        [[ $now != *$LAB_CONFIG:* ]] || break
+        sleep 0.05
+    done
+    echo "lab: the configuration of $1 is refused: $now" >&2
+    return 1
+}
+
+lab_events() { # NODE
+    cat "$LAB/$1-mgmtd.out"
+}
+lab_role() { # NODE GROUP
+    lab_events "$1" | sed -n "s/^role of group $2: //p" | tail -n 1
+}
+lab_wait_role() { # SECONDS NODE GROUP ROLE
+    local began=$SECONDS
+    until [ "$(lab_role "$2" "$3")" = "$4" ]; do
+        [ $((SECONDS - began)) -lt "$1" ] ||
+            { echo "lab: after $1 s the role of group $3 in $2 is '$(lab_role "$2" "$3")', not $4" >&2; return 1; }
+        sleep 0.1
+    done
+}
+lab_wait_event() { # SECONDS NODE EXPRESSION
+    lab_wait_line "$1" "$3" "$LAB/$2-mgmtd.out"
+}
+
+lab_mark() { # NODE
+    LAB_MARKED[$1]=$(wc -l <"$LAB/$1.log")
+}
+lab_log() { # NODE
+    tail -n +$((${LAB_MARKED[$1]-0} + 1)) "$LAB/$1.log"
+}
+lab_wait_log() { # SECONDS NODE EXPRESSION
+    local began=$SECONDS
+    until lab_log "$2" | grep -Eq -- "$3"; do
+        [ $((SECONDS - began)) -lt "$1" ] || { echo "lab: after $1 s no line in the log of $2: $3" >&2; return 1; }
+        sleep 0.1
+    done
+}
+
+lab_manage() { # NODE WORDS...
+    lab_in "$1" "$WCCP_BIN/mgmtctl" --json "${@:2}"
+}
+
+# What would be left behind in an appliance: processes, shared memory and semaphores, sockets, interfaces, files. The
+# registry of shared memory and the tunnel mailbox stay by design, with nobody attached, and so does the pid file.
+lab_remains() { # NODE
+    lab_in "$1" bash -c '
+        for own in /proc/[0-9]*; do
+            [ "${own#/proc/}" = 1 ] || [ "${own#/proc/}" = $$ ] || tr "\0" " " <$own/cmdline 2>/dev/null | sed "s/^/process /;s/\$/\n/"
+        done
+        awk "FNR > 1 && ! (\$7 == 0 && (\$1 == -1091567891 || \$1 == 1464025933)) { print \"segment\", \$1, \"attached\", \$7 }" /proc/sysvipc/shm
+        tail -n +2 -q /proc/sysvipc/sem /proc/sysvipc/msg | sed "s/^/semaphore or queue /"
+        grep -hE "^ *[0-9]+: [0-9A-F]+:0800" /proc/net/udp /proc/net/raw | sed "s/^/socket /"
+        sed 1d /proc/net/unix | grep -o "/.*" | grep -v "^/dev/log\$" | sed "s/^/socket /"
+        sed "1,2d;s/:.*//;s/^ */interface /" /proc/net/dev
+        ls -d /tmp/gcl-socks/* 2>/dev/null | sed "s/^/file /"'
+}
+
+lab_end() { # NODE...
+    local node name status now
+    for node; do
+        for name in wccpd tunneld mgmtd; do
+            [ -n "${LAB_PID[$node/$name]-}" ] || continue
+            lab_alive "$node" $name || continue
+            lab_stop "$node" $name; status=$?
+            [ $status = 0 ] || { echo "lab: $name of $node ended with $status" >&2; lab_show "$node"; return 1; }
+        done
+        now=$(lab_remains "$node")
+        [ "$now" = "${LAB_FOUND[$node]-}" ] ||
+            { echo "lab: not the same is left in $node:"; diff <(echo "${LAB_FOUND[$node]-}") <(echo "$now"); return 1; } >&2
+    done
+}
+
+# A line of the log begins with facility and level: eight times the one and the other.
+lab_clean_log() { # NODE [EXPRESSION...]
+    local node=$1 allowed bad; shift
+    allowed=$(IFS='|'; echo "$*")
+    bad=$(grep -E '^<([0-9]*[02468])?[0-9]>' "$LAB/$node.log" | awk -F'[<>]' '$2 % 8 <= 3' | grep -vE -- "${allowed:-^$}")
+    bad+=$(grep -hE 'Sanitizer|runtime error:' "$LAB/$node"-*.out)
+    [ -z "$bad" ] || { printf 'lab: %s says:\n%s\n' "$node" "$bad" >&2; return 1; }
+}
+
 # Writes what passes the bridge to a file until the lab ends or lab_capture_end. tcpdump wants to change its user and
 # groups, which a user namespace of an ordinary user refuses: dumpcap, which comes with tshark, does it there.
 lab_capture() { # FILE
@@ -264,10 +461,10 @@ if [ "${BASH_SOURCE[0]}" = "$0" ]; then
     for n in $(seq "$routers"); do lab_router "r$n" "10.0.0.$n"; done
     for n in $(seq "$appliances"); do lab_appliance "a$n" "10.0.0.$((100 + n))"; done
     export LAB WCCP_BIN LAB_HOME LAB_TOP
-    nodes=$(declare -p LAB_INIT LAB_PID)
+    nodes=$(declare -p LAB_INIT LAB_PID LAB_MARKED LAB_FOUND)
     export nodes
     if [ $# -gt 0 ]; then "$@"; exit; fi
     echo "routers: r1..r$routers at 10.0.0.1.. ; appliances: a1..a$appliances at 10.0.0.101.. ; files in $LAB"
-    echo "lab_in a1 COMMAND, lab_ctl r1 show, lab_start a1 NAME PROGRAM, lab_stop a1 NAME, lab_capture FILE; exit ends all"
+    echo "lab_in a1 COMMAND, lab_ctl r1 show, lab_appliance_start a1 \"\$(lab_group 51 10.0.0.1)\", lab_events a1, lab_end a1, lab_capture FILE; exit ends all"
     bash --rcfile <(echo "source '$LAB_HOME/topology.sh'; PS1='lab\\$ '; ${nodes//declare/declare -g}") -i
 fi
