@@ -70,14 +70,16 @@ protected:
     std::unique_ptr<wccp_view_appliance[]> appliances{new wccp_view_appliance[2048]{}};
 };
 
-const wire_bytes no_security = wire_bytes().u16(0).u16(4).u32(0);
-const wire_bytes standard_service = wire_bytes().u16(1).u16(24).u8(0).u8(50).zeros(22);
-const wire_bytes dynamic_service = wire_bytes().u16(1).u16(24).u8(1).u8(51).u8(200).u8(6).u32(0x13).zeros(16);
+wire_bytes hex(const std::string &digits) {
+    return wire_bytes().hex(digits);
+}
+const wire_bytes no_security = hex("0000 0004 00000000");
+const wire_bytes standard_service = hex("0001 0018 00 32").zeros(22);
+const wire_bytes dynamic_service = hex("0001 0018 01 33 c8 06 00000013").zeros(16);
 
 TEST_F(Load, TheFirstHereIAmOfAStandardGroup) {
-    const wire_bytes identity =
-        wire_bytes().u16(3).u16(44).ip(0, 100).u16(0).u16(0).zeros(32).u16(0x0102).u16(0);
-    const wire_bytes view = wire_bytes().u16(5).u16(12).u32(0x01020304).u32(0).u32(0);
+    const wire_bytes identity = hex("0003 002c 0a000064 0000 0000").zeros(32).hex("0102 0000");
+    const wire_bytes view = hex("0005 000c 01020304 00000000 00000000");
     ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
     EXPECT_EQ(loaded(), wire_message(10, {no_security, standard_service, identity, view}));
     EXPECT_EQ(pkt->length, 108u);
@@ -102,43 +104,14 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
     group->state_flags = WCCP_STATE_ACTIVE | WCCP_SHUTTING_DOWN;
     add_routers(2);
     add_appliances(3);
-    routers[0].receive_id = to_be32(0xb1b2b3b4);
-    routers[0].router_id = ipa(1, 2);
-    routers[1].receive_id = to_be32(0xa1a2a3a4);
-    routers[1].router_id = ipa(1, 1);
-    std::swap(appliances[0].ipa, appliances[2].ipa);
-    const wire_bytes security = wire_bytes().u16(0).u16(20).u32(1).hex("de4e3731fbfbdacecf23601043c72c24");
-    const wire_bytes service = wire_bytes().u16(1).u16(24).u8(1).u8(90).u8(200).u8(6).u32(0x13).zeros(16);
-    const wire_bytes identity = wire_bytes()
-                                    .u16(3)
-                                    .u16(32)
-                                    .ip(0, 100)
-                                    .u16(0)
-                                    .u16(2)
-                                    .u32(1)
-                                    .u32(0x1741)
-                                    .u32(0xf00)
-                                    .u16(0x21)
-                                    .u16(0x8001)
-                                    .u32(0)
-                                    .u16(0x0102)
-                                    .u16(0);
-    const wire_bytes view = wire_bytes()
-                                .u16(5)
-                                .u16(40)
-                                .u32(0x01020304)
-                                .u32(2)
-                                .ip(1, 1)
-                                .u32(0xa1a2a3a4)
-                                .ip(1, 2)
-                                .u32(0xb1b2b3b4)
-                                .u32(3)
-                                .ip(0, 100)
-                                .ip(0, 101)
-                                .ip(0, 102);
-    const wire_bytes capabilities = wire_bytes().u16(8).u16(24).hex(
-        "00 01 00 04 00 00 00 02  00 02 00 04 00 00 00 02  00 03 00 04 00 00 00 02");
-    const wire_bytes command = wire_bytes().u16(15).u16(8).u16(1).u16(4).ip(0, 100);
+    const wire_bytes security = hex("0000 0014 00000001 320b25f1d72ee64dfe0cd67d26c5f037");
+    const wire_bytes service = hex("0001 0018 01 5a c8 06 00000013").zeros(16);
+    const wire_bytes identity =
+        hex("0003 0020 0a000064 0000 0002 00000001 00001741 00000f00 0021 8001 00000000 0102 0000");
+    const wire_bytes view = hex("0005 0028 01020304 00000002 0a000102 a1a2a301 0a000101 a1a2a300 "
+                                "00000003 0a000066 0a000065 0a000064");
+    const wire_bytes capabilities = hex("0008 0018 0001 0004 00000002 0002 0004 00000002 0003 0004 00000002");
+    const wire_bytes command = hex("000f 0008 0001 0004 0a000064");
     ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
     EXPECT_EQ(loaded(), wire_message(10, {security, service, identity, view, capabilities, command}));
 
@@ -149,9 +122,10 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
         return bytes(pkt->data + 16, pkt->data + 32);
     };
     memcpy(group->password, "password", 8);
-    EXPECT_EQ(digest(), wire_bytes().hex("1d053b8d790be5611ed1d0d64453102a").bytes);
+    const bytes of_eight = hex("a7927010949b2579b11000a16b74968a").bytes;
+    EXPECT_EQ(digest(), of_eight);
     group->change_number++;
-    EXPECT_NE(digest(), wire_bytes().hex("1d053b8d790be5611ed1d0d64453102a").bytes);
+    EXPECT_NE(digest(), of_eight);
 }
 
 TEST_F(Load, CapabilitiesAreWhatDiffersFromTheDefaults) {
@@ -183,22 +157,9 @@ TEST_F(Load, ARedirectAssignByHash) {
     designate(3);
     for (uint32_t i = 0; i < 256; i++)
         group->bucket_index[i] = static_cast<uint8_t>(i % 3);
-    wire_bytes assignment = wire_bytes()
-                                .u16(6)
-                                .u16(272 + 24 + 12)
-                                .ip(0, 100)
-                                .u32(0x0a0b0c0d)
-                                .u32(2)
-                                .ip(1, 2)
-                                .u32(0xa1a2a301)
-                                .u32(0xc1c2c301)
-                                .ip(1, 1)
-                                .u32(0xa1a2a300)
-                                .u32(0xc1c2c300)
-                                .u32(3)
-                                .ip(0, 100)
-                                .ip(0, 101)
-                                .ip(0, 102);
+    wire_bytes assignment = hex("0006 0134 0a000064 0a0b0c0d 00000002 "
+                                "0a000102 a1a2a301 c1c2c301 0a000101 a1a2a300 c1c2c300 "
+                                "00000003 0a000064 0a000065 0a000066");
     for (uint32_t i = 0; i < 256; i++)
         assignment.u8(i % 3);
     ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
@@ -221,33 +182,11 @@ TEST_F(Load, ARedirectAssignByMask) {
     group->mask_value_count = 2;
     group->mask_values[0] = {0, 0x100, 0, 0x0700, ipa(0, 101)};
     group->mask_values[1] = {0x01000000, 0, 0x0506, 0, ipa(0, 100)};
-    const wire_bytes assignment = wire_bytes()
-                                      .u16(13)
-                                      .u16(36 + 12 + 32)
-                                      .u16(1)
-                                      .u16(32 + 12 + 32)
-                                      .ip(0, 100)
-                                      .u32(0x0a0b0c0d)
-                                      .u32(1)
-                                      .ip(1, 1)
-                                      .u32(0xa1a2a300)
-                                      .u32(0xc1c2c300)
-                                      .u32(1)
-                                      .u32(0x01020304)
-                                      .u32(0xf00)
-                                      .u16(0x0506)
-                                      .u16(0x0708)
-                                      .u32(2)
-                                      .u32(0)
-                                      .u32(0x100)
-                                      .u16(0)
-                                      .u16(0x0700)
-                                      .ip(0, 101)
-                                      .u32(0x01000000)
-                                      .u32(0)
-                                      .u16(0x0506)
-                                      .u16(0)
-                                      .ip(0, 100);
+    const wire_bytes assignment = hex("000d 0050 0001 004c 0a000064 0a0b0c0d "
+                                      "00000001 0a000101 a1a2a300 c1c2c300 "
+                                      "00000001 01020304 00000f00 0506 0708 "
+                                      "00000002 00000000 00000100 0000 0700 0a000065 "
+                                      "01000000 00000000 0506 0000 0a000064");
     ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
     EXPECT_EQ(loaded(), wire_message(12, {no_security, dynamic_service, assignment}));
     EXPECT_EQ(routers[0].assign_tx_count, 1u);
@@ -273,39 +212,30 @@ TEST_F(Load, TheLargestMessagesFit) {
 
 TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
     add_routers(1);
-    add_appliances(1);
-    designate(1);
-    group->mask_value_count = 1;
-    const auto refused = [this] {
-        const uint32_t sent = routers[0].assign_tx_count;
-        int count = 0;
-        for (const uint32_t method : {WCCP_ASSIGN_HASH, WCCP_ASSIGN_MASK}) {
+    const struct {
+        uint32_t designated, routers, active, values, appliances;
+        int by_hash, by_mask, by_neither;
+    } rows[] = {
+        {1, 1, 1, 1, 1, 0, 0, 1},    {0, 1, 1, 1, 1, 1, 1, 1},
+        {1, 0, 1, 1, 1, 1, 1, 1},    {1, 1, 0, 0, 1, 1, 1, 1},
+        {1, 1, 33, 129, 1, 1, 1, 1}, {1, 1, 1, 1, 0, 0, 1, 1}, // the view is asked of the mask form alone
+    };
+    for (const auto &row : rows) {
+        group->designated = row.designated;
+        group->sending_router_count = row.routers;
+        group->dsg_active_count = row.active;
+        group->mask_value_count = row.values;
+        group->appliance_view_count = row.appliances;
+        const int expected[] = {row.by_neither, row.by_hash, row.by_mask, row.by_neither};
+        for (uint32_t method = 0; method < 4; method++) {
             clear();
             group->assign_method = method;
-            count += wccp_pkt_build_redirect_assign(group.get(), pkt.get()) == 1 && pkt->length == 44;
+            const uint32_t sent = routers[0].assign_tx_count;
+            EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), expected[method]);
+            EXPECT_EQ(routers[0].assign_tx_count, sent + (expected[method] ? 0 : 1));
+            EXPECT_EQ(pkt->length == 44, expected[method] == 1) << "where it stopped";
         }
-        return count == 2 && routers[0].assign_tx_count == sent;
-    };
-    EXPECT_FALSE(refused());
-    group->designated = 0;
-    EXPECT_TRUE(refused());
-    group->designated = 1;
-    group->sending_router_count = 0;
-    EXPECT_TRUE(refused());
-    group->sending_router_count = 1;
-    group->dsg_active_count = group->mask_value_count = 0;
-    EXPECT_TRUE(refused());
-    group->dsg_active_count = 33;
-    group->mask_value_count = 129;
-    EXPECT_TRUE(refused());
-    group->dsg_active_count = group->mask_value_count = 1;
-    group->appliance_view_count = 0; // asked of the mask form alone
-    group->assign_method = WCCP_ASSIGN_MASK;
-    clear();
-    EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 1);
-    group->assign_method = WCCP_ASSIGN_NONE;
-    clear();
-    EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 1);
+    }
 }
 
 // Each component goes to the last byte of the packet and not one byte further.
