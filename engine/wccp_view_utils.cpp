@@ -127,6 +127,13 @@ static void clear_marks(Entry *old, uint32_t count) {
         old[i].flags &= ~MARK;
 }
 
+// What a comparison leaves when each new mention is found. The marks show in a dump.
+template <typename Entry>
+static void mark_all(Entry *old, uint32_t count) {
+    for (uint32_t i = 0; i < count; i++)
+        old[i].flags |= MARK;
+}
+
 // Routers.
 
 static int add_router_mention(wccp_service_group *group, be32 address) {
@@ -159,8 +166,10 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
                             const be32 *addresses) {
     if (count > WCCP_MAX_ROUTERS)
         return 1;
-    if (repeats_last_report(router, count, addresses))
+    if (repeats_last_report(router, count, addresses)) {
+        mark_all(router->view_routers, count);
         return 0;
+    }
     const uint32_t old_count = router->view_router_count;
     bool changed = false;
     clear_marks(router->view_routers, old_count);
@@ -377,7 +386,9 @@ int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *r
     if (count > WCCP_MAX_APPLIANCES)
         return 1;
     bool changed = false;
-    if (!repeats_last_report(router, count, decoded) && take_changes(group, router, count, decoded, &changed))
+    if (repeats_last_report(router, count, decoded))
+        mark_all(router->view_appliances, count);
+    else if (take_changes(group, router, count, decoded, &changed))
         return 1;
     copy_report(router, count, decoded);
     if (changed)

@@ -14,7 +14,8 @@
 // The reset at exit runs on the main thread while an engine thread may be waiting. It raises `abandon`, which
 // ends a wait at its next look with the result of a time-out, then waits for the mutex, and only then
 // clears the header: a waiter never sees a `command` that the reset has cleared. Commands after the reset
-// (the tunnels deleted at exit) are given as ever.
+// (the tunnels deleted at exit) are given as ever. The memberships go before the roles are reset: an engine
+// thread that still changes state then reaches no policy group, and tunneld is left with UNKNOWN for all.
 //
 // Policy groups. A second small mutex, also a leaf, keeps the management thread, which changes membership,
 // from the engine's threads, which change roles. A table of 65536 bit sets would be 2 MB of locked memory for
@@ -39,29 +40,20 @@ static std::atomic<bool> abandon;
 
 static constexpr int ANSWER_POLLS = 2000;
 
-template <typename T>
-static T get(const T &field) {
-    return __atomic_load_n(&field, __ATOMIC_ACQUIRE);
-}
-template <typename T>
-static void put(T &field, T value) {
-    __atomic_store_n(&field, value, __ATOMIC_RELEASE);
-}
-
 // mailbox_mutex held.
 static void reset_block(wccp_tunnel_mailbox *mailbox, uint32_t index) {
     mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
-    put(mailbox->tunnel_id, uint16_t{0});
-    put(mailbox->status, 0u);
-    put(mailbox->local_ip, 0u);
-    put(mailbox->remote_ip, 0u);
-    put(mailbox->fmst_index, index);
-    put(mailbox->l2_group, uint8_t{0});
+    mailbox_put(mailbox->tunnel_id, uint16_t{0});
+    mailbox_put(mailbox->status, 0u);
+    mailbox_put(mailbox->local_ip, 0u);
+    mailbox_put(mailbox->remote_ip, 0u);
+    mailbox_put(mailbox->fmst_index, index);
+    mailbox_put(mailbox->l2_group, uint8_t{0});
     memset(mailbox->padding, 0, sizeof mailbox->padding);
-    put(mailbox->l2_value, 0u);
+    mailbox_put(mailbox->l2_value, 0u);
     for (uint32_t i = 0; i < WCCP_POLICY_GROUPS; i++) {
         wccp_policy_role *entry = &mailbox->policy_roles[i];
-        put(entry->policy_group, static_cast<uint16_t>(i));
+        mailbox_put(entry->policy_group, static_cast<uint16_t>(i));
         entry->padding = 0;
         entry->role.store(2, std::memory_order_relaxed);
     }
@@ -77,8 +69,8 @@ int wccp_init_shmem() {
     {
         const mutex_guard guard(&mailbox_mutex);
         reset_block(mailbox, WCCP_NO_INDEX);
-        put(wccp_mailbox_roles, &mailbox->policy_roles[0]);
-        put(wccp_mailbox, mailbox);
+        mailbox_put(wccp_mailbox_roles, &mailbox->policy_roles[0]);
+        mailbox_put(wccp_mailbox, mailbox);
     }
     wccp_init_policy_grp_mgr();
     QV_LOG(LC_LOG_DEBUG, "WCCP: Created shared memory of size: %u bytes", length);
@@ -86,16 +78,15 @@ int wccp_init_shmem() {
 }
 
 int wccp_cleanup_shmem() {
-    wccp_tunnel_mailbox *mailbox = get(wccp_mailbox);
+    wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
     if (!mailbox)
         return 0;
+    wccp_init_policy_grp_mgr();
     abandon.store(true, std::memory_order_release);
-    {
-        const mutex_guard guard(&mailbox_mutex);
-        reset_block(mailbox, 0);
-        abandon.store(false, std::memory_order_release);
-    }
-    return wccp_init_policy_grp_mgr();
+    const mutex_guard guard(&mailbox_mutex);
+    reset_block(mailbox, 0);
+    abandon.store(false, std::memory_order_release);
+    return 0;
 }
 
 namespace {
@@ -133,18 +124,18 @@ const command_kind set_l2_return = {MAILBOX_L2_RETURN, LC_LOG_ERR, "GRE tunnel L
 bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_t *out_status,
                   uint32_t *out_index) {
     const mutex_guard guard(&mailbox_mutex);
-    wccp_tunnel_mailbox *mailbox = get(wccp_mailbox);
+    wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
     if (!mailbox)
         return false;
     mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
     if (kind->code == MAILBOX_L2_RETURN) {
-        put(mailbox->l2_group, inputs->l2_group);
-        put(mailbox->l2_value, inputs->l2_value);
+        mailbox_put(mailbox->l2_group, inputs->l2_group);
+        mailbox_put(mailbox->l2_value, inputs->l2_value);
     } else {
-        put(mailbox->tunnel_id, inputs->tunnel_id);
-        put(mailbox->local_ip, inputs->local_ip);
-        put(mailbox->remote_ip, inputs->remote_ip);
-        put(mailbox->fmst_index, inputs->fmst_index);
+        mailbox_put(mailbox->tunnel_id, inputs->tunnel_id);
+        mailbox_put(mailbox->local_ip, inputs->local_ip);
+        mailbox_put(mailbox->remote_ip, inputs->remote_ip);
+        mailbox_put(mailbox->fmst_index, inputs->fmst_index);
     }
     pending_command pending = {mailbox, kind->code, false};
     mailbox->command.store(kind->code, std::memory_order_release);
@@ -155,8 +146,8 @@ bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32
         }
         if (mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE) {
             pending.answered = true;
-            *out_status = get(mailbox->status);
-            *out_index = get(mailbox->fmst_index);
+            *out_status = mailbox_get(mailbox->status);
+            *out_index = mailbox_get(mailbox->fmst_index);
             return true;
         }
         if (abandon.load(std::memory_order_acquire))

@@ -20,17 +20,8 @@
 wccp_tunnel_mailbox *wccp_mailbox;
 wccp_policy_role *wccp_mailbox_roles;
 
-template <typename T>
-static T get(const T &field) {
-    return __atomic_load_n(&field, __ATOMIC_ACQUIRE);
-}
-template <typename T>
-static void put(T &field, T value) {
-    __atomic_store_n(&field, value, __ATOMIC_RELEASE);
-}
-
 bool wccp_attach_mailbox() {
-    if (get(wccp_mailbox))
+    if (mailbox_get(wccp_mailbox))
         return true;
     if (cmem_exists_block(WCCP_MAILBOX_NAME) != 1)
         return false;
@@ -48,8 +39,8 @@ bool wccp_attach_mailbox() {
         return false;
     }
     auto *mailbox = static_cast<wccp_tunnel_mailbox *>(block);
-    put(wccp_mailbox_roles, &mailbox->policy_roles[0]);
-    put(wccp_mailbox, mailbox);
+    mailbox_put(wccp_mailbox_roles, &mailbox->policy_roles[0]);
+    mailbox_put(wccp_mailbox, mailbox);
     return true;
 }
 
@@ -70,8 +61,8 @@ struct inputs {
 };
 
 inputs read_once(const wccp_tunnel_mailbox *mailbox) {
-    return {get(mailbox->tunnel_id),  get(mailbox->local_ip), get(mailbox->remote_ip),
-            get(mailbox->fmst_index), get(mailbox->l2_group), get(mailbox->l2_value)};
+    return {mailbox_get(mailbox->tunnel_id),  mailbox_get(mailbox->local_ip), mailbox_get(mailbox->remote_ip),
+            mailbox_get(mailbox->fmst_index), mailbox_get(mailbox->l2_group), mailbox_get(mailbox->l2_value)};
 }
 
 inputs read_inputs(const wccp_tunnel_mailbox *mailbox) {
@@ -91,7 +82,7 @@ inputs read_inputs(const wccp_tunnel_mailbox *mailbox) {
 
 void wccp_get_tunnel_parameters(uint16_t *out_tunnel_id, mailbox_address *out_local,
                                 mailbox_address *out_remote, uint32_t *out_index) {
-    const wccp_tunnel_mailbox *mailbox = get(wccp_mailbox);
+    const wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
     if (!mailbox)
         return;
     const inputs read = read_inputs(mailbox);
@@ -102,7 +93,7 @@ void wccp_get_tunnel_parameters(uint16_t *out_tunnel_id, mailbox_address *out_lo
 }
 
 void wccp_get_config_paramters(uint8_t *out_group, uint32_t *out_value) {
-    const wccp_tunnel_mailbox *mailbox = get(wccp_mailbox);
+    const wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
     if (!mailbox)
         return;
     const inputs read = read_inputs(mailbox);
@@ -111,18 +102,18 @@ void wccp_get_config_paramters(uint8_t *out_group, uint32_t *out_value) {
 }
 
 void wccp_set_fmst_index(uint32_t index) {
-    if (wccp_tunnel_mailbox *mailbox = get(wccp_mailbox))
-        put(mailbox->fmst_index, index);
+    if (wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox))
+        mailbox_put(mailbox->fmst_index, index);
 }
 
 uint32_t wccp_get_fmst_index() {
-    const wccp_tunnel_mailbox *mailbox = get(wccp_mailbox);
-    return mailbox ? get(mailbox->fmst_index) : WCCP_NO_INDEX;
+    const wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
+    return mailbox ? mailbox_get(mailbox->fmst_index) : WCCP_NO_INDEX;
 }
 
 void wccp_set_tunnel_command_status(uint32_t status) {
-    if (wccp_tunnel_mailbox *mailbox = get(wccp_mailbox)) {
-        put(mailbox->status, status);
+    if (wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox)) {
+        mailbox_put(mailbox->status, status);
         mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
     }
 }

@@ -50,6 +50,16 @@ struct mailbox_address {
     uint64_t words[2];
 };
 
+// A field, as one access of its own width.
+template <typename T>
+T mailbox_get(const T &field) {
+    return __atomic_load_n(&field, __ATOMIC_ACQUIRE);
+}
+template <typename T>
+void mailbox_put(T &field, T value) {
+    __atomic_store_n(&field, value, __ATOMIC_RELEASE);
+}
+
 // This process's pointers to the block, null until it has created or attached it.
 extern wccp_tunnel_mailbox *wccp_mailbox;
 extern wccp_policy_role *wccp_mailbox_roles;

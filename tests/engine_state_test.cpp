@@ -33,78 +33,50 @@ extern "C" int qv_state_event_send(uint32_t one, const char *group_id, uint32_t 
 
 namespace {
 
-struct StateTest : testing::Test {
-    StateTest() {
-        wccp_g.seconds = 1000;
-        shared = new reported_group(true);
-        group = shared->group;
-        state_events.clear();
-    }
-    ~StateTest() override {
-        delete shared;
-        EXPECT_EQ(wccp_g.stat_allocs.load(), wccp_g.stat_frees.load());
-    }
-    void see(be32 from, const std::vector<be32> &routers, const reported_appliances &appliances) {
-        shared->see(from, routers, appliances);
-    }
-    // For so many seconds router A goes on reporting what it does.
-    void stay_alive(uint32_t seconds) {
-        while (seconds--) {
+struct StateTest : testing::Test, all_freed, reported_group {
+    StateTest() : reported_group(true) { state_events.clear(); }
+    // For so many seconds router A, once it is known, goes on reporting what it does. The seconds, counted
+    // from 1, at which `counter` rose.
+    std::vector<uint32_t>
+    stay_alive(uint32_t seconds,
+               uint32_t wccp_service_group::*counter = &wccp_service_group::tx_redirect_assign) {
+        std::vector<uint32_t> risen;
+        for (uint32_t second = 1; second <= seconds; second++) {
+            const uint32_t before = group->*counter;
             pass_seconds(1);
-            shared->router(ROUTER_A)->last_icu_time = wccp_g.seconds;
+            if (group->sending_router_count != 0)
+                router(ROUTER_A)->last_icu_time = wccp_g.seconds;
+            if (group->*counter != before)
+                risen.push_back(second);
         }
+        return risen;
     }
-    reported_group *shared;
-    wccp_service_group *group;
+    bool raised(uint16_t alarm) const { return (group->raised_alarms & alarm) != 0; }
 };
+using seconds_at = std::vector<uint32_t>;
 
 TEST_F(StateTest, HereIAmGoesAtOnceAndThenEveryTenSeconds) {
-    std::vector<uint32_t> sent_at;
-    for (uint32_t second = 1; second <= 35; second++) {
-        const uint32_t before = group->tx_here_i_am;
-        pass_seconds(1);
-        if (group->tx_here_i_am != before)
-            sent_at.push_back(second);
-    }
-    EXPECT_EQ(sent_at, (std::vector<uint32_t>{1, 11, 21, 31}));
+    EXPECT_EQ(stay_alive(35, &wccp_service_group::tx_here_i_am), (seconds_at{1, 11, 21, 31}));
     group->admin_state = WCCP_ADMIN_DOWN; // no tick for a disabled group
-    pass_seconds(20);
-    EXPECT_EQ(group->tx_here_i_am, 4u);
+    EXPECT_EQ(stay_alive(20, &wccp_service_group::tx_here_i_am), seconds_at{});
 }
 
 TEST_F(StateTest, ASoleApplianceElectsItselfAndAssignsSixteenSecondsAfterTheChange) {
     see(ROUTER_A, {ROUTER_A}, {{US, 100}});
     EXPECT_EQ(group->designated, 0u);
-    pass_seconds(1);
+    EXPECT_EQ(stay_alive(1), seconds_at{});
     EXPECT_EQ(group->designated, 1u);
     EXPECT_EQ(group->dsg_key_change, 1u);
     EXPECT_EQ(group->pending_acks, 1);
     EXPECT_EQ(group->dsg_appliances[0].assigned, 256);
-    std::vector<uint32_t> sent_at;
-    for (uint32_t second = 2; second <= 40; second++) {
-        const uint32_t before = group->tx_redirect_assign;
-        stay_alive(1);
-        if (group->tx_redirect_assign != before)
-            sent_at.push_back(second);
-    }
-    EXPECT_EQ(sent_at, (std::vector<uint32_t>{16, 26, 36}));
-    EXPECT_EQ(shared->router(ROUTER_A)->assign_tx_count, 3u);
+    EXPECT_EQ(stay_alive(39), (seconds_at{15, 25, 35}));
+    EXPECT_EQ(router(ROUTER_A)->assign_tx_count, 3u);
     EXPECT_EQ(group->dsg_key_change, 1u);
-}
-
-TEST_F(StateTest, AWeightChangeIsAssignedAtTheNextTick) {
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(2), 100}});
-    stay_alive(20);
-    EXPECT_EQ(group->tx_redirect_assign, 1u);
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(2), 300}});
+    // A change of a weight is assigned at the next tick.
+    see(ROUTER_A, {ROUTER_A}, {{US, 300}});
     EXPECT_FALSE(group->state_flags & WCCP_DESG_ELECT_PENDING);
     EXPECT_EQ(group->dsg_key_change, 2u);
-    stay_alive(1);
-    EXPECT_EQ(group->tx_redirect_assign, 2u);
-    stay_alive(9);
-    EXPECT_EQ(group->tx_redirect_assign, 2u);
-    stay_alive(1);
-    EXPECT_EQ(group->tx_redirect_assign, 3u);
+    EXPECT_EQ(stay_alive(15), (seconds_at{1, 11}));
 }
 
 TEST_F(StateTest, TheLowestAddressAsANumberIsDesignated) {
@@ -156,21 +128,21 @@ TEST_F(StateTest, TheKeyCountsOnUntilTheElectionIsLost) {
     see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(3), 100}, {host(4), 100}});
     pass_seconds(1);
     EXPECT_EQ(group->dsg_key_change, 1u);
-    shared->router(ROUTER_A)->assign_tx_count = 2;
+    router(ROUTER_A)->assign_tx_count = 2;
     see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(4), 100}}); // 3 is down for one computation
     pass_seconds(1);
     EXPECT_EQ(group->dsg_key_change, 2u);
     EXPECT_EQ(group->dsg_appliances[0].assigned + group->dsg_appliances[1].assigned, 256);
     EXPECT_NE(group->dsg_appliances[0].assigned, 128);
-    EXPECT_EQ(shared->router(ROUTER_A)->assign_tx_count, 0u);
-    EXPECT_TRUE(shared->router(ROUTER_A)->flags & WCCP_RTR_ASSIGN_UNACKED);
+    EXPECT_EQ(router(ROUTER_A)->assign_tx_count, 0u);
+    EXPECT_TRUE(router(ROUTER_A)->flags & WCCP_RTR_ASSIGN_UNACKED);
 
     see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(0), 100}});
     pass_seconds(1);
     EXPECT_EQ(group->designated, 0u);
     EXPECT_EQ(group->pending_acks, 0);
     EXPECT_EQ(group->assign_timer.active, 0);
-    EXPECT_FALSE(shared->router(ROUTER_A)->flags & WCCP_RTR_ASSIGN_UNACKED);
+    EXPECT_FALSE(router(ROUTER_A)->flags & WCCP_RTR_ASSIGN_UNACKED);
     see(ROUTER_A, {ROUTER_A}, {{US, 100}});
     pass_seconds(1);
     EXPECT_EQ(group->dsg_key_change, 1u);
@@ -194,16 +166,13 @@ TEST_F(StateTest, WithNobodyEligibleThereIsNoTable) {
 }
 
 TEST_F(StateTest, ASilentRouterGoesAfter40To44Seconds) {
-    for (uint32_t phase = 0; phase < 5; phase++) {
+    for (uint32_t phase = 0; phase < 5; phase++) { // sweeps go by the start of the group
         see(ROUTER_A, {ROUTER_A}, {{US, 100}});
-        uint32_t gone_after = 0;
-        while (group->sending_router_count != 0 && gone_after < 60) {
-            pass_seconds(1);
-            gone_after++;
-        }
-        const uint32_t sweep = (wccp_g.seconds - 1000) % 5; // sweeps go by the start of the group
-        EXPECT_EQ(sweep, 0u);
-        EXPECT_EQ(gone_after, phase == 0 ? 40u : 45u - phase);
+        const uint32_t expected = phase == 0 ? 40 : 45 - phase;
+        pass_seconds(expected - 1);
+        EXPECT_EQ(group->sending_router_count, 1u);
+        pass_seconds(1);
+        EXPECT_EQ(group->sending_router_count, 0u);
         EXPECT_TRUE(group->state_flags & WCCP_DESG_ELECT_PENDING); // the election is the next tick's
         EXPECT_EQ(group->designated, 1u);
         EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ADJACENCY);
@@ -215,78 +184,55 @@ TEST_F(StateTest, ASilentRouterGoesAfter40To44Seconds) {
 }
 
 TEST_F(StateTest, StatesTellTheirRolesEachTime) {
-    const auto flags = [this] { return group->state_flags & WCCP_STATE_MASK; };
+    const struct {
+        int (*enter)(wccp_service_group *);
+        uint32_t state, transitions, state_time;
+    } steps[] = {
+        {wccp_appliance_state_init, WCCP_STATE_INIT, 0, 0}, // it is in INIT
+        {wccp_appliance_state_active, WCCP_STATE_ACTIVE, 1, 1010},
+        {wccp_appliance_state_active, WCCP_STATE_ACTIVE, 2, 1020},
+        {wccp_appliance_state_backup, WCCP_STATE_BACKUP, 3, 1030},
+        {wccp_appliance_state_backup, WCCP_STATE_BACKUP, 4, 1040},
+        {wccp_appliance_state_init, WCCP_STATE_INIT, 4, 1040},
+    };
     group->state_flags |= WCCP_CAPABILITIES_SET;
-    wccp_appliance_state_init(group); // it is in INIT
-    EXPECT_EQ(state_events.size(), 0u);
-    wccp_appliance_state_active(group);
-    EXPECT_EQ(flags(), WCCP_STATE_ACTIVE);
-    EXPECT_EQ(group->state_time, 1000u);
-    wccp_g.seconds = 1010;
-    wccp_appliance_state_active(group);
-    wccp_g.seconds = 1020;
-    wccp_appliance_state_backup(group);
-    EXPECT_EQ(flags(), WCCP_STATE_BACKUP);
-    wccp_appliance_state_backup(group);
-    EXPECT_EQ(group->transitions, 4u);
-    wccp_g.seconds = 1030;
-    wccp_appliance_state_init(group);
-    EXPECT_EQ(flags(), WCCP_STATE_INIT);
-    EXPECT_EQ(group->transitions, 4u);
-    EXPECT_EQ(group->state_time, 1020u);
-    EXPECT_TRUE(group->state_flags & WCCP_CAPABILITIES_SET);
-    const state_event active = {1, "51", 0, 237}, backup = {1, "51", 1, 237};
-    EXPECT_EQ(state_events, (std::vector<state_event>{active, active, backup, backup, backup}));
-
-    state_events.clear();
-    EXPECT_EQ(wccp_set_role_and_send_event(255, WCCP_ROLE_UNKNOWN), 0);
-    EXPECT_EQ(wccp_set_role_and_send_event(255, 3), 1);
-    EXPECT_EQ(state_events, (std::vector<state_event>{{1, "255", 2, 237}}));
-
+    group->state_time = 0;
+    wccp_g.seconds = 1000;
+    for (const auto &step : steps) {
+        step.enter(group);
+        EXPECT_EQ(group->state_flags, step.state | WCCP_CAPABILITIES_SET);
+        EXPECT_EQ(group->transitions, step.transitions);
+        EXPECT_EQ(group->state_time, step.state_time);
+        wccp_g.seconds += 10;
+    }
     wccpd_exiting = 1; // the role changes, but nobody is told
     wccp_appliance_state_active(group);
     wccpd_exiting = 0;
-    EXPECT_EQ(flags(), WCCP_STATE_ACTIVE);
-    EXPECT_EQ(state_events.size(), 1u);
+    EXPECT_TRUE(group->state_flags & WCCP_STATE_ACTIVE);
+    EXPECT_EQ(wccp_set_role_and_send_event(255, WCCP_ROLE_UNKNOWN), 0);
+    EXPECT_EQ(wccp_set_role_and_send_event(255, 3), 1);
+    const state_event active = {1, "51", 0, 237}, backup = {1, "51", 1, 237}, unknown = {1, "255", 2, 237};
+    EXPECT_EQ(state_events, (std::vector{active, active, backup, backup, backup, unknown}));
 }
 
 // Alarms.
 
 TEST_F(StateTest, ASilentRouterRaisesTheAdjacencyAlarm60SecondsAfterTheStart) {
-    const auto raised = [this] { return (group->raised_alarms & WCCP_ALARM_ADJACENCY) != 0; };
     group->ucast_router_count = 2;
     see(ROUTER_A, {ROUTER_A}, {{US, 100}});
     stay_alive(59);
-    EXPECT_FALSE(raised());
+    EXPECT_FALSE(raised(WCCP_ALARM_ADJACENCY));
     stay_alive(1);
-    EXPECT_TRUE(raised());
+    EXPECT_TRUE(raised(WCCP_ALARM_ADJACENCY));
     stay_alive(100); // a quiet group keeps what it has
-    EXPECT_TRUE(raised());
+    EXPECT_TRUE(raised(WCCP_ALARM_ADJACENCY));
     uint32_t cleared_after = 0;
-    while (raised() && cleared_after < 100) {
+    while (raised(WCCP_ALARM_ADJACENCY) && cleared_after < 100) {
         see(ROUTER_B, {ROUTER_A}, {{US, 100}});
         stay_alive(1);
         cleared_after++;
     }
     EXPECT_EQ(cleared_after, 60u);
-}
-
-TEST_F(StateTest, ConnectivityIsHealthyWithEnoughTwoWayAndNoneOneWay) {
-    const auto check = [this] {
-        group->raised_alarms = 0;
-        wccp_alarm_verify_router_connectivity(group);
-        return group->raised_alarms == 0;
-    };
-    EXPECT_TRUE(check()); // nothing expected, nothing there
-    group->mcast_configured = 1;
-    group->ucast_router_count = 5;
-    EXPECT_FALSE(check());
-    see(ROUTER_A, {}, {{US, 100}});
-    EXPECT_TRUE(check());
-    see(ROUTER_B, {}, {{US, 100}});
-    EXPECT_TRUE(check());
-    see(ROUTER_C, {}, {});
-    EXPECT_FALSE(check());
 }
 
 TEST_F(StateTest, ALaterReasonLeavesTheCheckWhereItIs) {
@@ -302,100 +248,110 @@ TEST_F(StateTest, ALaterReasonLeavesTheCheckWhereItIs) {
     EXPECT_EQ(group->router_alarm_timer.active, 0);
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 0); // a stopped one starts anew
     EXPECT_EQ(group->router_alarm_timer.countdown, 60u);
-    wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
-    group->assign_alarm_timer.countdown = 0;
+    group->assign_alarm_timer = {.active = 1, .mode = 2, .remaining = 1, .period = 60, .countdown = 0};
     wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
     EXPECT_EQ(group->assign_alarm_timer.countdown, 60u);
+    // Clearing stops the timers, and passes over a group without alarms.
+    wccp_alarms_clear_all();
+    EXPECT_EQ(group->router_alarm_timer.active, 1);
+    wccp_alarm_raise_router_down_alarm(group);
+    wccp_alarms_verify_allocation_table(group);
+    group->raised_alarms = WCCP_ALARM_ADJACENCY | WCCP_ALARM_ASSIGNMENT;
+    wccp_alarms_clear_all();
+    EXPECT_EQ(group->raised_alarms, 0);
+    EXPECT_EQ(group->router_alarm_timer.active + group->assign_alarm_timer.active, 0);
+}
+
+// The two checks on a group in which no alarm stands: whether all is in order.
+bool connected(wccp_service_group *group) {
+    group->raised_alarms = 0;
+    wccp_alarm_verify_router_connectivity(group);
+    return group->raised_alarms == 0;
+}
+bool carried_out(wccp_service_group *group) {
+    group->raised_alarms = 0;
+    wccp_alarms_verify_allocation_table(group);
+    return group->raised_alarms != WCCP_ALARM_ASSIGNMENT;
+}
+
+TEST_F(StateTest, ConnectivityIsHealthyWithEnoughTwoWayAndNoneOneWay) {
+    EXPECT_TRUE(connected(group)); // nothing expected, nothing there
+    group->mcast_configured = 1;
+    group->ucast_router_count = 5;
+    EXPECT_FALSE(connected(group));
+    see(ROUTER_A, {}, {{US, 100}});
+    EXPECT_TRUE(connected(group));
+    see(ROUTER_B, {}, {{US, 100}});
+    EXPECT_TRUE(connected(group));
+    see(ROUTER_C, {}, {});
+    EXPECT_FALSE(connected(group));
 }
 
 TEST_F(StateTest, TheDesignatedComparesWhatItAskedFor) {
-    const auto check = [this] {
-        wccp_alarms_verify_allocation_table(group);
-        return group->raised_alarms == 0;
-    };
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(2), 100}, {host(3), 0}});
-    see(ROUTER_B, {ROUTER_B}, {{US, 100}, {host(2), 100}, {host(3), 0}});
+    for (const be32 id : {ROUTER_A, ROUTER_B})
+        see(id, {id}, {{US, 100}, {host(2), 100}, {host(3), 0}});
     pass_seconds(1);
     ASSERT_EQ(group->designated, 1u);
-    EXPECT_FALSE(check());
+    EXPECT_FALSE(carried_out(group));
     for (const be32 id : {ROUTER_A, ROUTER_B})
         for (uint32_t i = 0; i < 2; i++)
-            shared->router(id)->view_appliances[i].buckets_assigned = 128;
-    EXPECT_TRUE(check());
-    shared->router(ROUTER_B)->view_appliances[0].buckets_assigned = 127;
-    EXPECT_FALSE(check());
-    EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ASSIGNMENT);
-    shared->router(ROUTER_B)->view_appliances[0].buckets_assigned = 128;
-    shared->router(ROUTER_B)->view_appliances[2].weight = 1; // and no buckets
-    EXPECT_FALSE(check());
+            router(id)->view_appliances[i].buckets_assigned = 128;
+    EXPECT_TRUE(carried_out(group));
+    router(ROUTER_B)->view_appliances[0].buckets_assigned = 127;
+    EXPECT_FALSE(carried_out(group));
+    router(ROUTER_B)->view_appliances[0].buckets_assigned = 128;
+    router(ROUTER_B)->view_appliances[2].weight = 1; // and no buckets
+    EXPECT_FALSE(carried_out(group));
+}
+
+TEST_F(StateTest, AnyOtherLooksForHoles) {
+    EXPECT_TRUE(carried_out(group)); // no routers at all
+    see(ROUTER_A, {}, {});
+    EXPECT_FALSE(carried_out(group));
+    see(ROUTER_A, {}, {{host(1), 0}});
+    EXPECT_FALSE(carried_out(group)); // in order, but nobody gets anything
+    see(ROUTER_A, {}, {{host(1), 0}, {host(2), 10}});
+    EXPECT_FALSE(carried_out(group));
+    router(ROUTER_A)->view_appliances[1].buckets_assigned = 1;
+    EXPECT_TRUE(carried_out(group));
 }
 
 TEST_F(StateTest, AlarmsAreToldInTheLogAndFailWithoutASession) {
     log_lines log;
-    const auto tells = [&log](const std::vector<std::string> &wanted) {
+    const auto tells = [&log](int (*check)(wccp_service_group *), wccp_service_group *of,
+                              const std::vector<std::string> &wanted) {
+        log.take();
+        check(of);
         const std::string lines = log.take();
         size_t from = 0;
         for (const std::string &line : wanted) {
-            from = lines.find(line, from);
+            from = lines.find("WCCP GRP 51: alarm: " + line, from);
             ASSERT_NE(from, std::string::npos) << line << "\n-- among --\n" << lines;
         }
+        EXPECT_EQ(lines.find("Error code 14001 returned") != std::string::npos, wanted.size() > 2) << lines;
     };
     group->ucast_router_count = 2;
     see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(2), 7}});
-    log.take();
-    wccp_alarm_verify_router_connectivity(group);
-    tells({"WCCP GRP 51: alarm: verify router connectivity.",
-           "WCCP GRP 51: alarm: raising router down alarm. routers configured: 2 connections one-way: 0 "
-           "two-way: 1",
-           "WCCP GRP 51: alarm: raising adjacency down alarm", "Error code 14001"});
+    tells(wccp_alarm_verify_router_connectivity, group,
+          {"verify router connectivity.",
+           "raising router down alarm. routers configured: 2 connections one-way: 0 two-way: 1",
+           "raising adjacency down alarm"});
     group->ucast_router_count = 1;
-    wccp_alarm_verify_router_connectivity(group);
-    tells({"WCCP GRP 51: alarm: clearing router down alarm: routers one-way: 0 two-way: 1 configured: 1.",
-           "WCCP GRP 51: alarm: clearing adjacency down alarm"});
-    wccp_alarm_verify_router_connectivity(group);
-    tells({"WCCP GRP 51: alarm: router verification is ok. configured: 1 one-way: 0 two-way: 1"});
-    shared->router(ROUTER_A)->view_appliances[0].buckets_assigned = 9;
-    wccp_alarms_verify_allocation_table(group);
-    tells({"WCCP GRP 51: alarm: verify assignment table.", "WCCP GRP 51: alarm: verify by non-designator.",
-           "WCCP GRP 51: alarm: router 10.0.0.201 is not redirecting to appliance (10.0.0.2 weight 7)",
-           "WCCP GRP 51: alarm: raising assignment table mismatch alarm"});
-    pass_seconds(1);
-    log.take();
-    wccp_alarms_verify_allocation_table(group); // designated by now
-    tells({"WCCP GRP 51: alarm: verify allocation. appliance 10.0.0.",
-           "WCCP GRP 51: alarm: allocation mismatch. appliance 10.0.0."});
+    tells(wccp_alarm_verify_router_connectivity, group,
+          {"verify router connectivity.",
+           "clearing router down alarm: routers one-way: 0 two-way: 1 configured: 1.",
+           "clearing adjacency down alarm"});
+    tells(wccp_alarm_verify_router_connectivity, group,
+          {"verify router connectivity.", "router verification is ok. configured: 1 one-way: 0 two-way: 1"});
+    router(ROUTER_A)->view_appliances[0].buckets_assigned = 9;
+    tells(wccp_alarms_verify_allocation_table, group,
+          {"verify assignment table.", "verify by non-designator.",
+           "router 10.0.0.201 is not redirecting to appliance (10.0.0.2 weight 7)",
+           "raising assignment table mismatch alarm"});
+    pass_seconds(1); // designated by now
+    tells(wccp_alarms_verify_allocation_table, group,
+          {"verify allocation. appliance 10.0.0.", "allocation mismatch. appliance 10.0.0."});
     EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ASSIGNMENT);
-}
-
-TEST_F(StateTest, AnyOtherLooksForHoles) {
-    group->appliance_ipa = host(9);
-    const auto check = [this] {
-        wccp_alarms_verify_allocation_table(group);
-        return group->raised_alarms == 0;
-    };
-    group->raised_alarms = WCCP_ALARM_ASSIGNMENT;
-    EXPECT_TRUE(check()); // no routers at all
-    see(ROUTER_A, {}, {});
-    EXPECT_FALSE(check());
-    see(ROUTER_A, {}, {{host(1), 0}});
-    EXPECT_FALSE(check()); // in order, but nobody gets anything
-    see(ROUTER_A, {}, {{host(1), 0}, {host(2), 10}});
-    EXPECT_FALSE(check());
-    shared->router(ROUTER_A)->view_appliances[1].buckets_assigned = 1;
-    EXPECT_TRUE(check());
-}
-
-TEST_F(StateTest, ClearingStopsTheTimersAndOnlyTouchesGroupsWithAlarms) {
-    wccp_alarm_raise_router_down_alarm(group);
-    wccp_alarms_verify_allocation_table(group);
-    wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
-    wccp_alarms_clear_all();
-    EXPECT_EQ(group->raised_alarms, 0);
-    EXPECT_EQ(group->router_alarm_timer.active, 0);
-    EXPECT_EQ(group->assign_alarm_timer.active, 0);
-    wccp_alarm_schedule_verify_router_connectivity_timer(group, 0);
-    wccp_alarms_clear_all();
-    EXPECT_EQ(group->router_alarm_timer.active, 1);
 }
 
 } // namespace

@@ -3,9 +3,7 @@
 #include "engine/wccp_tunnel.h"
 
 #include <gtest/gtest.h>
-#include <pthread.h>
 
-#include <chrono>
 #include <set>
 #include <string>
 
@@ -61,34 +59,24 @@ std::optional<tunneld_answer> tunneld_refuses(const seen_command &command) {
 
 TEST_F(Tunnels, GroupsThatShareARouterShareTheTunnel) {
     EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
+    EXPECT_TRUE(log.say("WCCP GRP 51: created GRE tunnel id 1000 10.0.0.1 <=> 10.0.1.1"));
     EXPECT_EQ(wccp_add_tunnel(52, self, router(1)), 0);
-    auto given = commands();
-    ASSERT_EQ(given.size(), 1u);
-    EXPECT_EQ(given[0].code, MAILBOX_ADD_TUNNEL);
-    EXPECT_EQ(given[0].tunnel_id, g_qv_encap_wccp_first);
-    EXPECT_EQ(given[0].local, 0x0A000001u) << "host order";
-    EXPECT_EQ(given[0].remote, 0x0A000101u);
-    EXPECT_EQ(given[0].index, WCCP_NO_INDEX);
-    EXPECT_NE(log.take().find("WCCP GRP 51: created GRE tunnel id 1000 10.0.0.1 <=> 10.0.1.1"),
-              std::string::npos);
-
+    EXPECT_EQ(commands(), (std::vector<seen_command>{
+                              {MAILBOX_ADD_TUNNEL, 1000, 0x0A000001, 0x0A000101, WCCP_NO_INDEX, 0, 0}}))
+        << "once, and in host order";
     EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
     EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "no such tunnel";
     EXPECT_EQ(commands().size(), 0u);
     EXPECT_EQ(wccp_del_tunnel(52, self, router(1), 0), 0);
-    given = commands();
-    ASSERT_EQ(given.size(), 1u);
-    EXPECT_EQ(given[0].code, MAILBOX_DELETE_TUNNEL);
-    EXPECT_EQ(given[0].index, 1000u + g_qv_encap_wccp_first) << "the index of its add";
-    EXPECT_NE(log.take().find("WCCP GRP 52: deleted GRE tunnel id: 1000 10.0.0.1 <=> 10.0.1.1"),
-              std::string::npos);
-}
+    EXPECT_EQ(commands(),
+              (std::vector<seen_command>{{MAILBOX_DELETE_TUNNEL, 1000, 0x0A000001, 0x0A000101, 2000, 0, 0}}))
+        << "with the index of its add";
+    EXPECT_TRUE(log.say("WCCP GRP 52: deleted GRE tunnel id: 1000 10.0.0.1 <=> 10.0.1.1"));
 
-TEST_F(Tunnels, ForceIgnoresTheReferences) {
     wccp_add_tunnel(51, self, router(1));
     wccp_add_tunnel(52, self, router(1));
-    EXPECT_EQ(wccp_del_tunnel(0, self, router(1), 1), 0);
-    EXPECT_NE(log.take().find("WCCP : deleted GRE tunnel id: 1000"), std::string::npos);
+    EXPECT_EQ(wccp_del_tunnel(0, self, router(1), 1), 0) << "by force, whatever the references";
+    EXPECT_TRUE(log.say("WCCP : deleted GRE tunnel id: 1000"));
     EXPECT_EQ(commands().size(), 2u);
     EXPECT_EQ(wccp_del_tunnel(52, self, router(1), 0), 0);
     EXPECT_EQ(commands().size(), 0u);
@@ -101,7 +89,7 @@ TEST_F(Tunnels, ThirtyTwoIdsAndTheFreedOneIsNext) {
     }
     EXPECT_EQ(commands().back().tunnel_id, g_qv_encap_wccp_last);
     EXPECT_EQ(wccp_add_tunnel(1, self, router(32)), 1);
-    EXPECT_NE(log.take().find("WCCP GRP 1: No free tunnel id available"), std::string::npos);
+    EXPECT_TRUE(log.say("WCCP GRP 1: No free tunnel id available"));
     EXPECT_EQ(wccp_add_tunnel(1, self, router(4)), 0) << "an old one needs no id";
     EXPECT_EQ(commands().size(), 0u);
     for (const uint32_t i : {31u, 7u}) {
@@ -117,8 +105,7 @@ TEST_F(Tunnels, ARefusedAddLeavesNothing) {
                               }}) {
         tunneld.answer_with(answer);
         EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 1);
-        EXPECT_NE(log.take().find("WCCP GRP 51: failed to add tunnel: id: 1000 10.0.0.1 <=> 10.0.1.1"),
-                  std::string::npos);
+        EXPECT_TRUE(log.say("WCCP GRP 51: failed to add tunnel: id: 1000 10.0.0.1 <=> 10.0.1.1"));
         EXPECT_EQ(commands().size(), 1u);
         EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
         EXPECT_EQ(commands().size(), 0u) << "it isn't in the table";
@@ -133,10 +120,10 @@ TEST_F(Tunnels, ARefusedDeleteTakesTheTunnelOutAllTheSame) {
     wccp_add_tunnel(51, self, router(2));
     tunneld.answer_with(tunneld_refuses);
     EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 1);
-    EXPECT_NE(log.take().find("WCCP GRP 51: failed to delete GRE tunnel id: 1000"), std::string::npos);
+    EXPECT_TRUE(log.say("WCCP GRP 51: failed to delete GRE tunnel id: 1000"));
     wccpd_exiting = 1;
     EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "in silence during the exit";
-    EXPECT_EQ(log.take().find("failed to delete"), std::string::npos);
+    EXPECT_FALSE(log.say("failed to delete"));
     commands();
     wccp_del_all_tunnels();
     EXPECT_EQ(commands().size(), 0u);
@@ -154,8 +141,7 @@ TEST_F(Tunnels, RestoreGivesEveryTunnelAgainAndKeepsThemAll) {
     auto given = commands();
     ASSERT_EQ(given.size(), 3u);
     EXPECT_EQ(given[0].tunnel_id, g_qv_encap_wccp_first + 2) << "the newest first";
-    EXPECT_NE(log.take().find("WCCP:retore tunnel: failed to create tunnel. id: 1001 10.0.0.1 <=> 10.0.1.1"),
-              std::string::npos);
+    EXPECT_TRUE(log.say("WCCP:retore tunnel: failed to create tunnel. id: 1001 10.0.0.1 <=> 10.0.1.1"));
     wccp_del_all_tunnels();
     given = commands();
     ASSERT_EQ(given.size(), 3u);
@@ -166,20 +152,7 @@ TEST_F(Tunnels, RestoreGivesEveryTunnelAgainAndKeepsThemAll) {
 TEST_F(Tunnels, ACancelledAddGivesIdAndRecordBack) {
     tunneld.answer_with(tunneld_is_silent);
     for (int i = 0; i < 3; i++) {
-        pthread_t adder;
-        ASSERT_EQ(pthread_create(
-                      &adder, nullptr,
-                      [](void *) -> void * {
-                          wccp_add_tunnel(51, self, router(1));
-                          return nullptr;
-                      },
-                      nullptr),
-                  0);
-        tunneld.wait_for_command();
-        pthread_cancel(adder);
-        void *result = nullptr;
-        pthread_join(adder, &result);
-        ASSERT_EQ(result, PTHREAD_CANCELED);
+        cancel_while_it_waits(&tunneld, [] { wccp_add_tunnel(51, self, router(1)); });
         EXPECT_EQ(wccp_g.stat_allocs - wccp_g.stat_frees, allocated);
         EXPECT_EQ(wccp_get_tunnel_command(), 0) << "nobody knows the tunnel that would come of it";
     }
@@ -193,20 +166,7 @@ TEST_F(Tunnels, ACancelledDeleteStillTakesTheTunnelOut) {
     EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
     EXPECT_EQ(wccp_add_tunnel(51, self, router(2)), 0);
     tunneld.answer_with(tunneld_is_silent);
-    pthread_t deleter;
-    ASSERT_EQ(pthread_create(
-                  &deleter, nullptr,
-                  [](void *) -> void * {
-                      wccp_del_tunnel(51, self, router(1), 0);
-                      return nullptr;
-                  },
-                  nullptr),
-              0);
-    tunneld.wait_for_command();
-    pthread_cancel(deleter);
-    void *result = nullptr;
-    pthread_join(deleter, &result);
-    ASSERT_EQ(result, PTHREAD_CANCELED);
+    cancel_while_it_waits(&tunneld, [] { wccp_del_tunnel(51, self, router(1), 0); });
     tunneld.answer_with(tunneld_does);
     while (wccp_get_tunnel_command() != MAILBOX_IDLE) // the delete is carried out late
         std::this_thread::yield();

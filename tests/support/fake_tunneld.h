@@ -52,6 +52,9 @@ std::optional<tunneld_answer> tunneld_does(const seen_command &command);
 // No command answered.
 std::optional<tunneld_answer> tunneld_is_silent(const seen_command &command);
 
+// Runs `work` on a thread, and cancels it once `tunneld` has seen its command and left it unanswered.
+void cancel_while_it_waits(fake_tunneld *tunneld, const std::function<void()> &work);
+
 // The configuration file with the mailbox's line, where wccpd looks for it. Before wccp_init_shmem.
 // Writes the line for the mailbox and lets the process make its block once more.
 void write_mem_conf();

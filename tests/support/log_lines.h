@@ -12,6 +12,8 @@ struct log_lines {
 
     // All lines since the last call, each as its datagram was.
     std::string take();
+    // Whether they hold this text.
+    bool say(const std::string &text) { return take().find(text) != std::string::npos; }
 
     int fd;
 };

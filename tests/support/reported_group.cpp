@@ -1,5 +1,7 @@
 #include "tests/support/reported_group.h"
 
+#include <gtest/gtest.h>
+
 #include <cstring>
 
 #include "engine/wccp_config.h"
@@ -68,6 +70,10 @@ void reported_group::see(be32 from, const std::vector<be32> &routers,
     router(from)->last_icu_time = wccp_g.seconds;
     report_routers(from, routers);
     report(from, appliances);
+}
+
+all_freed::~all_freed() {
+    EXPECT_EQ(wccp_g.stat_allocs.load(), wccp_g.stat_frees.load());
 }
 
 void pass_seconds(uint32_t seconds) {

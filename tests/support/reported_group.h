@@ -33,5 +33,10 @@ struct reported_group {
     wccp_service_group *group;
 };
 
+// As a base before reported_group: at the end of a test all that the engine allocated is free again.
+struct all_freed {
+    ~all_freed();
+};
+
 // Ticks of the engine.
 void pass_seconds(uint32_t seconds);
