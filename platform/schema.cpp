@@ -119,6 +119,39 @@ const std::vector<schema_row> &schema() {
     return rows;
 }
 
+#define STATE "/qv/wccpd/wccp/srv_grp/state"
+const std::vector<const char *> &wccpd_state_nodes() {
+    static const std::vector<const char *> nodes = {
+        "/qv/wccpd/system/state/proto_ver",
+        "/qv/wccpd/system/state/is_alive",
+        "/qv/wccpd/system/state/debug_global",
+        "/qv/wccpd/system/state/debug_all",
+        STATE "/*",
+        STATE "/*/oper",
+        STATE "/*/uptime",
+        STATE "/*/app_id",
+        STATE "/*/num_routers",
+        STATE "/*/num_appliances",
+        STATE "/*/debug",
+        STATE "/*/assignment",
+        STATE "/*/router/*",
+        STATE "/*/router/*/state",
+        STATE "/*/router/*/fwd_method",
+        STATE "/*/router/*/ret_method",
+        STATE "/*/router/*/assign_method",
+        STATE "/*/router/*/id",
+        STATE "/*/router/*/ipaddr",
+        STATE "/*/router/*/conn_time",
+        STATE "/*/router/*/appliance/*",
+        STATE "/*/router/*/appliance/*/load_dist",
+        // Appliances are asked for by number; as a node of its own the number keeps a walk out of it.
+        STATE "/*/appliance/*",
+        STATE "/*/appliance/*/ipaddr",
+        STATE "/*/appliance/*/weight",
+    };
+    return nodes;
+}
+
 // --- Names
 
 static bool is_number(const std::string &part) {

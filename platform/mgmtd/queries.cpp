@@ -1,9 +1,9 @@
 // Queries: of the configuration and of what mgmtd itself reports from memory, of the state of a daemon by
 // asking that daemon.
 //
-// The state nodes of each daemon are rows of a table; a query below one of their roots goes to the daemon's
-// session, all nodes of it in one request, with the rows in front as registration nodes. A query of a
-// subtree that holds such a root takes it along, and is none the worse when the daemon isn't there. The
+// The state nodes of each daemon stand beside the schema; a query below one of their roots goes to the
+// daemon's session, all nodes of it in one request, with the rows in front as registration nodes. A query of
+// a subtree that holds such a root takes it along, and is none the worse when the daemon isn't there. The
 // daemon whose session it is asks for its configuration only; it is never asked for what it asked for.
 #include <algorithm>
 
@@ -14,42 +14,12 @@ namespace {
 struct state_source {
     const char *client; // the daemon's client name
     std::vector<const char *> roots;
-    std::vector<const char *> nodes;
+    const std::vector<const char *> &(*nodes)();
 };
 } // namespace
 
-#define STATE "/qv/wccpd/wccp/srv_grp/state"
 static const state_source sources[] = {
-    {"wccpd",
-     {"/qv/wccpd/system/state", STATE},
-     {
-         "/qv/wccpd/system/state/proto_ver",
-         "/qv/wccpd/system/state/is_alive",
-         "/qv/wccpd/system/state/debug_global",
-         "/qv/wccpd/system/state/debug_all",
-         STATE "/*",
-         STATE "/*/oper",
-         STATE "/*/uptime",
-         STATE "/*/app_id",
-         STATE "/*/num_routers",
-         STATE "/*/num_appliances",
-         STATE "/*/debug",
-         STATE "/*/assignment",
-         STATE "/*/router/*",
-         STATE "/*/router/*/state",
-         STATE "/*/router/*/fwd_method",
-         STATE "/*/router/*/ret_method",
-         STATE "/*/router/*/assign_method",
-         STATE "/*/router/*/id",
-         STATE "/*/router/*/ipaddr",
-         STATE "/*/router/*/conn_time",
-         STATE "/*/router/*/appliance/*",
-         STATE "/*/router/*/appliance/*/load_dist",
-         // Appliances are asked for by number; as a node of its own the number keeps a walk out of it.
-         STATE "/*/appliance/*",
-         STATE "/*/appliance/*/ipaddr",
-         STATE "/*/appliance/*/weight",
-     }},
+    {"wccpd", {"/qv/wccpd/system/state", "/qv/wccpd/wccp/srv_grp/state"}, wccpd_state_nodes},
 };
 static constexpr uint32_t CAPABILITIES = 1; // the nodes can be read
 
@@ -76,7 +46,7 @@ static bool append_registrations(bn_request_msg *msg, const state_source &source
         bn_attrib_array_new(&attributes.pointer) != LC_OK ||
         bn_attrib_array_set_takeover(attributes.pointer, bn_attrib_capability_mask, &mask.pointer) != LC_OK)
         return false;
-    for (const char *name : source.nodes)
+    for (const char *name : source.nodes())
         if (bn_query_request_msg_append_with_attribs(msg, bn_query_registration_info, 0, name,
                                                      attributes.pointer, nullptr) != LC_OK)
             return false;
@@ -230,8 +200,10 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
     const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
     for (uint32_t i = 0; i < count; i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
-        const auto asked = node ? query.node_ids.find(node->node_id) : query.node_ids.end();
-        if (asked != query.node_ids.end() && node->binding)
+        if (!node || !node->binding)
+            continue;
+        const auto asked = query.node_ids.find(node->node_id);
+        if (asked != query.node_ids.end())
             (void)bn_query_response_msg_append_binding_takeover(response.pointer, &node->binding,
                                                                 asked->second);
     }
