@@ -112,7 +112,8 @@ struct lc_lock_guard {
 void bail_debug();
 void bail_quiet_debug();
 
-// The bodies of the checks; each logs as its check says and gives the status to return.
+// The bodies of the checks; each logs as its check says and gives the status to return. The macros return it
+// themselves, so that whoever reads the caller alone, a static analyser for one, sees that it is a failure.
 lc_status lc_check_status(lc_status status, const char *function, const char *file, int line);
 lc_status lc_check_null(const char *function, const char *file, int line);
 lc_status lc_check_condition(const char *function, const char *file, int line);
@@ -124,8 +125,10 @@ lc_status lc_check_forced(lc_status status, const char *function, const char *fi
 #define CHECK_STATUS(expression)                                                                             \
     do {                                                                                                     \
         const lc_status check_status_ = (expression);                                                        \
-        if (__builtin_expect(check_status_ != 0, 0))                                                         \
-            return lc_check_status(check_status_, __func__, LC_FILE_NAME, __LINE__);                         \
+        if (__builtin_expect(check_status_ != 0, 0)) {                                                       \
+            (void)lc_check_status(check_status_, __func__, LC_FILE_NAME, __LINE__);                          \
+            return check_status_;                                                                            \
+        }                                                                                                    \
     } while (0)
 // Quiet check: a failure is returned without a line.
 #define CHECK_QUIET(expression)                                                                              \
@@ -139,17 +142,26 @@ lc_status lc_check_forced(lc_status status, const char *function, const char *fi
 // Null check: a null pointer is logged and LC_NULL returned.
 #define CHECK_NULL(pointer)                                                                                  \
     do {                                                                                                     \
-        if (__builtin_expect((pointer) == nullptr, 0))                                                       \
-            return lc_check_null(__func__, LC_FILE_NAME, __LINE__);                                          \
+        if (__builtin_expect((pointer) == nullptr, 0)) {                                                     \
+            (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);                                           \
+            return LC_NULL;                                                                                  \
+        }                                                                                                    \
     } while (0)
 // Condition check: a false condition is logged and LC_ASSERTION returned.
 #define CHECK_CONDITION(condition)                                                                           \
     do {                                                                                                     \
-        if (__builtin_expect(!(condition), 0))                                                               \
-            return lc_check_condition(__func__, LC_FILE_NAME, __LINE__);                                     \
+        if (__builtin_expect(!(condition), 0)) {                                                             \
+            (void)lc_check_condition(__func__, LC_FILE_NAME, __LINE__);                                      \
+            return LC_ASSERTION;                                                                             \
+        }                                                                                                    \
     } while (0)
 // A failure of one's own making.
-#define FAIL_WITH(status) return lc_check_forced((status), __func__, LC_FILE_NAME, __LINE__)
+#define FAIL_WITH(status)                                                                                    \
+    do {                                                                                                     \
+        const lc_status forced_status_ = (status);                                                           \
+        (void)lc_check_forced(forced_status_, __func__, LC_FILE_NAME, __LINE__);                             \
+        return forced_status_;                                                                               \
+    } while (0)
 // The status check's line without the return, for callers that go on.
 #define LOG_STATUS(status)                                                                                   \
     do {                                                                                                     \

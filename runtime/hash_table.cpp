@@ -68,6 +68,11 @@ void ht_default_options(ht_options *out) {
     out->key_equal_function = ht_key_equal_string_func;
 }
 
+static ht_entry **new_buckets(uint32_t count) {
+    // NOLINTNEXTLINE(bugprone-sizeof-expression): a bucket is the pointer to its first entry
+    return static_cast<ht_entry **>(calloc(count, sizeof(ht_entry *)));
+}
+
 lc_status ht_new(ht **out, const ht_options *options) {
     CHECK_NULL(out);
     *out = nullptr;
@@ -77,7 +82,7 @@ lc_status ht_new(ht **out, const ht_options *options) {
         options = &defaults;
     auto *table = static_cast<ht *>(calloc(1, sizeof(ht)));
     CHECK_NULL(table);
-    table->buckets = static_cast<ht_entry **>(calloc(ht_table_size_initial, sizeof(ht_entry *)));
+    table->buckets = new_buckets(ht_table_size_initial);
     if (!table->buckets) {
         free(table);
         FAIL_WITH(LC_NULL);
@@ -95,7 +100,7 @@ lc_status ht_new(ht **out, const ht_options *options) {
 }
 
 static void resize(ht *table, uint32_t bucket_count) {
-    auto **buckets = static_cast<ht_entry **>(calloc(bucket_count, sizeof(ht_entry *)));
+    ht_entry **buckets = new_buckets(bucket_count);
     if (!buckets)
         return;
     LC_LOG(LC_LOG_DEBUG, "resize ht from %d to %d", static_cast<int32_t>(table->bucket_count),

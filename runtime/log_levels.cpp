@@ -105,7 +105,7 @@ static bool overridden(const lc_log_state *state) {
 
 static void make_current(lc_log_state *state, uint8_t level) {
     state->current_level = level;
-    const int32_t own = G_daemon_log_level;
+    const int32_t own = lc_log_get_daemon_log_level();
     syslog_set_mask(own != -1 ? own : level);
     G_log_level = level;
 }

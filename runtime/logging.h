@@ -51,7 +51,8 @@ extern const lc_enum_entry lc_log_facility_table[]; // "kern" 0 to "local7" 184
 
 // True when a line of this level would be written: the test that every statement makes first.
 inline bool lc_log_check_level(int32_t level) {
-    const int32_t own = static_cast<int32_t>(G_daemon_log_level.load(std::memory_order_relaxed));
+    // NOLINTNEXTLINE(bugprone-signed-char-misuse): the sign is what tells "none"
+    const int32_t own = G_daemon_log_level.load(std::memory_order_relaxed);
     return (own != -1 ? own : G_log_level.load(std::memory_order_relaxed)) >= level;
 }
 

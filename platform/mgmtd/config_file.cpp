@@ -179,7 +179,7 @@ bool config_parse(const std::string &content, const std::string &file, node_tree
             good = take_value(&state, line, number, &reason);
         }
         if (!good)
-            *out_errors += file + ":" + std::to_string(number) + ": " + reason + "\n";
+            out_errors->append(file).append(":" + std::to_string(number) + ": ").append(reason + "\n");
     }
     if (!state.pending.empty())
         out_comments->before[""] = state.pending;

@@ -70,6 +70,7 @@ static int64_t time_left(int64_t now, std::initializer_list<int64_t> due) {
     return left;
 }
 
+// NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
     std::string config = "/etc/mgmtd.conf", wccpd = "wccpd", tunneld = "tunneld";
     bool check = false, supervise = false;

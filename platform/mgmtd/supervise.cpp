@@ -44,6 +44,7 @@ static std::string end_text(int wait_status) {
     sigprocmask(SIG_SETMASK, &none, nullptr);
     signal(SIGPIPE, SIG_DFL);
     std::vector<char *> arguments;
+    arguments.reserve(command.size() + 1);
     for (const std::string &word : command)
         arguments.push_back(const_cast<char *>(word.c_str()));
     arguments.push_back(nullptr);

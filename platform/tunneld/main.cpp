@@ -10,6 +10,7 @@
 
 static constexpr uint32_t COMPONENT_TUNNELD = 257u << 16;
 
+// NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
     tunneld_options options;
     CLI::App app{"The tunnel daemon: takes the commands that wccpd leaves in the mailbox, and prints them."};
