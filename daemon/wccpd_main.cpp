@@ -46,6 +46,7 @@ const char *const wccpd_program_name = "wccpd";
 lew *wccpd_lwc;
 std::atomic<int32_t> m_daemon_status{WCCPD_INITIALIZING};
 std::atomic<int32_t> wccpd_exiting;
+bool wccpd_engine_begun;
 uint32_t g_qv_encap_entry_count;
 uint32_t g_qv_encap_wccp_first, g_qv_encap_wccp_last;
 uint32_t g_qv_encap_clstr_first, g_qv_encap_clstr_last;
@@ -120,6 +121,7 @@ lc_status wccpd_pid_init() {
 
 lc_status wccpd_serv_init() {
     CHECK_CONDITION(wccpd_lwc != nullptr);
+    wccpd_engine_begun = true;
     return wccp_init_mgr();
 }
 

@@ -91,7 +91,12 @@ static lc_status wccpd_process_proc_fail(const char *event_name, const bn_bindin
     return LC_OK;
 }
 
+// A change that comes before the engine is begun has nothing to change; the start reads the whole tree later.
 static lc_status wccpd_config_changed(const char *, bn_binding_array *bindings) {
+    if (!wccpd_engine_begun) {
+        LC_LOG(LC_LOG_INFO, "Configuration change before the engine's start: left to the start");
+        return LC_OK;
+    }
     owned_bindings old_values, new_values;
     CHECK_STATUS(mdc_event_config_change_notif_extract(bindings, &old_values.pointer, &new_values.pointer));
     CHECK_STATUS(wccpd_config_apply(new_values.pointer));

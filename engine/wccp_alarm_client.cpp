@@ -8,6 +8,11 @@
 // thread, so that nobody holds those locks while waiting for the loop's. No callback here ever takes the
 // engine lock.
 //
+// The start waits for the alarm thread, which waits for mgmtd. The main thread is not deaf meanwhile: it
+// waits in rounds of its own loop, and the alarm thread's last step of the start wakes it. An exit that
+// begins in such a round ends both waits, the opening by `qv_exiting`. The alarm thread makes its loop under
+// a mutex and looks at `qv_exiting` there, so that whoever ends it either finds the loop or is seen.
+//
 // qv_initiate_exit comes from the main thread at exit, and from the alarm thread itself when the session is
 // lost; the thread does not join itself. A lost alarm session ends this client only: the daemon ends through
 // its working session, which goes with the same peer.
@@ -21,6 +26,7 @@
 #include <semaphore.h>
 
 #include "engine/cthread.h"
+#include "engine/wccp_host.h"
 #include "mgmt/client_session.h"
 #include "runtime/logging.h"
 
@@ -48,7 +54,8 @@ static mgmt_client qv_alm_client = {&qv_alm_lwc,
 static pthread_t alarm_thread;
 static std::atomic<bool> alarm_thread_runs; // the thread handle is set
 static sem_t started;
-static bool started_exists;
+static bool started_exists; // changes while no alarm thread runs, or none that will look at it again
+static pthread_mutex_t loop_mutex = PTHREAD_MUTEX_INITIALIZER; // guards qv_alm_lwc until the thread has ended
 
 static lc_status qv_alm_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
     CHECK_STATUS(mgmt_client_response(&qv_alm_client, response));
@@ -80,8 +87,21 @@ static lc_status qv_alm_mgmt_open_session(const char *client_name) {
     return status;
 }
 
-static lc_status start_session(const char *client_name) {
+static lew *made_loop() {
+    const mutex_guard guard(&loop_mutex);
+    return qv_alm_lwc;
+}
+
+static lc_status make_loop() {
+    const mutex_guard guard(&loop_mutex);
+    if (qv_exiting)
+        return LC_CANCELLED;
     CHECK_STATUS(lew_init(&qv_alm_lwc));
+    return LC_OK;
+}
+
+static lc_status start_session(const char *client_name) {
+    CHECK_STATUS(make_loop());
     CHECK_STATUS(mgmt_client_init(&qv_alm_client, qv_alm_mgmt_handle_session_close));
     CHECK_STATUS(
         bn_set_global_callback_query_response_msg(qv_alm_instance, qv_alm_mgmt_handle_response, nullptr));
@@ -93,10 +113,20 @@ static lc_status start_session(const char *client_name) {
     return LC_OK;
 }
 
+// Tells the main thread, which may be waiting in its loop; the work itself is nothing.
+static void tell_started() {
+    static loop_post wake = {nullptr, nullptr, [](loop_post *, int) {}};
+    loop_context *main_loop = nullptr;
+    if (!started_exists)
+        return;
+    sem_post(&started);
+    if (wccpd_lwc && lew_get_event_context(wccpd_lwc, &main_loop) == LC_OK)
+        loop_post_work(main_loop, &wake);
+}
+
 static void *qv_alm_thread(void *client_name) {
     const lc_status status = start_session(static_cast<const char *>(client_name));
-    if (started_exists)
-        sem_post(&started);
+    tell_started();
     if (status != LC_OK) {
         LC_LOG(LC_LOG_ERR, "qv_alm_thread: failed to initialize alarm session");
         return nullptr;
@@ -121,6 +151,19 @@ static int create_thread(const char *client_name) {
     return result;
 }
 
+// Until the alarm thread has posted, or an exit has begun, which ends that thread or waits for nobody.
+static void wait_for_start() {
+    int no_events = 0;
+    bool has_loop = wccpd_lwc != nullptr;
+    while ((has_loop ? sem_trywait(&started) : sem_wait(&started)) != 0) {
+        if (!has_loop)
+            continue; // a signal
+        if (wccpd_shutdown_in_progress())
+            return;
+        has_loop = lew_dispatch_once(wccpd_lwc, &no_events, nullptr) == LC_OK && !no_events;
+    }
+}
+
 lc_status qv_alm_mgmt_init(const char *client_name) {
     started_exists = sem_init(&started, 0, 0) == 0;
     if (!started_exists)
@@ -130,8 +173,8 @@ lc_status qv_alm_mgmt_init(const char *client_name) {
     if (result != 0)
         LC_LOG(LC_LOG_ERR, "Failed to create alarm thread : %s ", strerror(result));
     if (started_exists) {
-        while (alarm_thread_runs && sem_wait(&started) != 0 && errno == EINTR) {
-        }
+        if (result == 0)
+            wait_for_start();
         sem_destroy(&started);
         started_exists = false;
     }
@@ -140,8 +183,8 @@ lc_status qv_alm_mgmt_init(const char *client_name) {
 
 lc_status qv_alm_mgmt_shutdown() {
     LC_LOG(LC_LOG_INFO, "qv_alm_mgmt_shutdown: cancel alm thread");
-    if (qv_alm_lwc)
-        CHECK_STATUS(lew_escape_from_dispatch(qv_alm_lwc));
+    if (lew *loop = made_loop())
+        CHECK_STATUS(lew_escape_from_dispatch(loop));
     if (alarm_thread_runs && !pthread_equal(alarm_thread, pthread_self())) {
         const int result = pthread_join(alarm_thread, nullptr);
         if (result != 0 && result != ESRCH) {
@@ -159,8 +202,8 @@ lc_status qv_alm_mgmt_shutdown() {
 lc_status qv_initiate_exit() {
     qv_exiting = 1;
     CHECK_STATUS(qv_alm_mgmt_shutdown());
-    if (qv_alm_lwc)
-        CHECK_STATUS(lew_escape_from_dispatch(qv_alm_lwc));
+    if (lew *loop = made_loop())
+        CHECK_STATUS(lew_escape_from_dispatch(loop));
     return LC_OK;
 }
 

@@ -10,6 +10,8 @@
 int32_t wccpd_shutdown_in_progress();
 extern std::atomic<int32_t> wccpd_exiting;
 
+extern struct lew *wccpd_lwc; // the main thread's loop, null when it has none
+
 // First and last tunnel id reserved for redirected traffic, both inclusive, 32 in all.
 extern uint32_t g_qv_encap_wccp_first, g_qv_encap_wccp_last;
 

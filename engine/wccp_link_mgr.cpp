@@ -44,8 +44,9 @@ static void clear_interface(wccp_interface *interface) {
 int wccp_init_link_mgr() {
     {
         const wccp_engine_lock lock;
-        for (wccp_interface &interface : wccp_g.interfaces)
-            clear_interface(&interface);
+        // A change of configuration that came since the start began may have taken the first ones already.
+        for (uint32_t i = wccp_g.if_count; i < WCCP_MAX_INTERFACES; i++)
+            clear_interface(&wccp_g.interfaces[i]);
     }
     // Asks mgmtd and runs the event loop meanwhile: no lock here.
     wccp_init_primary_wan_interface();

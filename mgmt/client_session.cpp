@@ -11,6 +11,7 @@ lc_status mgmt_client_init(mgmt_client *client, fdic_handler close_handler) {
     CHECK_STATUS(fdic_libevent_set_fd_close_handler(*client->bridge, close_handler, nullptr));
     gcl_options options;
     CHECK_STATUS(gcl_options_get_defaults(&options));
+    options.ending = client->exiting;
     CHECK_STATUS(gcl_init(client->instance, &options, *client->interests));
     return LC_OK;
 }

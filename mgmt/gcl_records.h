@@ -102,8 +102,8 @@ inline gcl_admin *gcl_admin_of(const gcl_session *session) {
 
 using gcl_owned_buffer = owned<tbuffer, tb_release>;
 
-// gcl_blocking.cpp: whether a signal that ends the process waits for this thread.
-bool gcl_end_is_pending();
+// gcl_blocking.cpp: whether a signal that ends the process waits for this thread, or the instance is ending.
+bool gcl_end_is_pending(const gcl *instance);
 
 // gcl_admin.cpp
 lc_status gcl_admin_register(gcl *instance);

@@ -270,7 +270,7 @@ static lc_status try_connect(gcl_session *session, int attempts) {
         if (passing && attempts > 0) {
             LC_LOG(LC_LOG_INFO, "Could not connect to provider; delaying and retrying.");
             (void)poll(nullptr, 0, CONNECT_DELAY_MS);
-            if (gcl_end_is_pending())
+            if (gcl_end_is_pending(session->instance))
                 return LC_CANCELLED;
             continue;
         }

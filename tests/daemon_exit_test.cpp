@@ -1,8 +1,10 @@
 // The exit that begins while the daemon waits for mgmtd: by a signal, by the loss of the session, by the word
 // that tunneld has gone, at each request of the start and once the daemon is ready. The daemon runs in a
 // process of its own; the provider is this test, which answers so many requests and no more.
+#include <atomic>
 #include <csignal>
 #include <ctime>
+#include <thread>
 
 #include <gtest/gtest.h>
 #include <sys/resource.h>
@@ -11,6 +13,7 @@
 #include "daemon/wccpd_main.h"
 #include "mgmt/owners.h"
 #include "tests/support/gcl_provider.h"
+#include "tests/support/log_daemon.h"
 
 namespace {
 
@@ -18,8 +21,9 @@ constexpr double EXIT_SECONDS = 3;
 constexpr double CPU_SECONDS = 1;
 constexpr int QUIET_MS = 1000; // a daemon that asks nothing for so long is ready
 
-enum class cause { signal, lost_session, tunneld };
-const char *const cause_names[] = {"SIGTERM", "the session lost", "tunneld gone"};
+enum class cause { signal, lost_session, tunneld, lost_working_session };
+const char *const cause_names[] = {"SIGTERM", "the session lost", "tunneld gone",
+                                   "only the working session lost"};
 
 double now_seconds() {
     timespec now;
@@ -137,18 +141,22 @@ struct scripted_run {
     void bring(cause what) {
         if (what == cause::signal)
             kill(daemon, SIGTERM);
-        if (what == cause::lost_session) {
+        if (what == cause::lost_session || what == cause::lost_working_session)
             working.close_client();
+        if (what == cause::lost_session)
             alarms.close_client();
-        }
-        if (what == cause::tunneld) {
-            owned_request event;
-            ASSERT_EQ(bn_event_request_msg_create(&event.pointer, "/pm/events/failure/crash"), LC_OK);
+        if (what == cause::tunneld)
+            put_event("/pm/events/failure/crash", "tunneld");
+    }
+    void put_event(const char *name, const char *process) {
+        owned_request event;
+        ASSERT_EQ(bn_event_request_msg_create(&event.pointer, name), LC_OK);
+        if (process) {
             ASSERT_EQ(bn_event_request_msg_append_new_binding(event.pointer, 0, "process_name", bn_type_str,
-                                                              "tunneld", nullptr),
+                                                              process, nullptr),
                       LC_OK);
-            put_request(event.pointer);
         }
+        put_request(event.pointer);
     }
     void expect_exit() {
         const double start = now_seconds();
@@ -195,18 +203,67 @@ TEST(DaemonExit, WhileTheServiceIsNotOpen) {
     run.expect_exit();
 }
 
+// What the daemon logs from here on, read all the time.
+struct log_reader {
+    log_daemon log;
+    std::atomic<bool> over{false};
+    std::string text;
+    std::thread thread;
+
+    log_reader() { (void)!symlink("7", "/var/opt/rvl/output/sysloglevel"); }
+    void start() {
+        thread = std::thread([this] {
+            for (bool last = false; !last;) {
+                last = over;
+                for (const std::string &line : log.take(20))
+                    text += line;
+            }
+        });
+    }
+    void expect_in_order(std::initializer_list<const char *> lines) {
+        end();
+        size_t place = 0;
+        for (const char *line : lines) {
+            const size_t found = text.find(line, place);
+            EXPECT_NE(found, std::string::npos) << line << " is missing or out of its place in\n" << text;
+            place = found == std::string::npos ? place : found;
+        }
+    }
+    void end() {
+        over = true;
+        if (thread.joinable())
+            thread.join();
+    }
+    ~log_reader() { end(); }
+};
+
 // The start waits for the alarm thread then, which waits for the provider.
 TEST(DaemonExit, WhileTheAlarmSessionIsNotOpen) {
-    for (const cause what : {cause::signal, cause::lost_session}) {
+    for (const cause what :
+         {cause::signal, cause::lost_session, cause::tunneld, cause::lost_working_session}) {
         SCOPED_TRACE(cause_names[static_cast<int>(what)]);
+        log_reader log;
         scripted_run run;
+        log.start();
         ASSERT_EQ(run.serve(4), 5); // the interests
         run.answer(run.unanswered);
         run.alarms.listener = run.working.listener;
         ASSERT_TRUE(run.alarms.accept_client());
         run.alarms.listener = -1;
+        run.put_event("/mgmtd/notify/dbchange", nullptr); // the engine's records aren't there yet
         run.bring(what);
         run.expect_exit();
+        const char *told = what == cause::signal    ? "Received SIGTERM"
+                           : what == cause::tunneld ? "WCCP: Detected that tunneld has exited"
+                                                    : "Lost connection to mgmtd; exiting";
+        log.expect_in_order({told, "WCCP: alarms: clearing all alarms.",
+                             "qv_alm_mgmt_shutdown: cancel alm thread",
+                             "qv_alm_mgmt_shutdown: alm thread exited", "WCCP: wccp manager is exiting",
+                             "WCCP daemon exiting with code 0"});
+        log.expect_in_order({"qv_alm_thread: failed to initialize alarm session",
+                             "qv_alm_mgmt_shutdown: alm thread exited", "WCCP: wccp manager"});
+        if (what != cause::signal) // which comes at any moment
+            log.expect_in_order({"change before the engine's start: left to the start", told});
     }
 }
 
