@@ -7,7 +7,7 @@
 // while the group still runs. When the second commit is refused all the same, the old group is created again;
 // when nothing more can be done, the command that would bring it back is told.
 //
-// A value that equals the fallback of its word is left out of the group that is created again, so that the
+// A value that equals the default of its node is left out of the group that is created again, so that the
 // configuration file goes on holding what was set and no defaults.
 //
 // Behind a change, wccpd's list of groups is looked at until it agrees, for some seconds at most. The list
@@ -22,6 +22,8 @@
 
 #include <nlohmann/json.hpp>
 
+#include "mgmt/bnode_types.h"
+#include "platform/schema.h"
 #include "runtime/common.h"
 
 using json = nlohmann::ordered_json;
@@ -32,31 +34,50 @@ static const char *const STATES = "/qv/wccpd/wccp/srv_grp/state";
 static const char *const TRIAL_END = "/mgmtctl/this/is/only/a/trial";
 
 const std::vector<group_word> &group_words() {
-    static const char *const NUMBER = "a number, also as 0x...";
     static const std::vector<group_word> words = {
-        {"interface", "interface", "NAME, or none: the first of the appliance", nullptr, true, false},
-        {"router", "router", "ADDRESS, once for each router; the list as a whole", nullptr, true, false},
-        {"weight", "weight", "0 to 65535", "100", false, false},
-        {"password", "password", "up to 8 characters; \"\" for none", "", false, true},
-        {"policy", "policy_grp", "1 to 65535, or none", nullptr, false, false},
-        {"admin", "admin", "up, down", "up", false, false},
-        {"priority", "priority", "0 to 255", "200", true, false},
-        {"protocol", "protocol", "a name, or 1 to 255", "tcp", true, false},
-        {"encap", "encap", "gre, l2, either", "either", false, false},
-        {"force_l2_return", "force_l2_return", "true, false", "false", false, false},
-        {"assign", "assign_method", "hash, mask, either", "either", false, false},
-        {"detail", "assign_detail", "a text", nullptr, false, true},
-        {"hash_src_ip", "hash_src_ip", "true, false", "true", false, false},
-        {"hash_dst_ip", "hash_dst_ip", "true, false", "false", false, false},
-        {"hash_src_port", "hash_src_port", "true, false", "false", false, false},
-        {"hash_dst_port", "hash_dst_port", "true, false", "false", false, false},
-        {"mask_src_ip", "mask_src_ip", NUMBER, "0", false, false},
-        {"mask_dst_ip", "mask_dst_ip", NUMBER, "3840", false, false},
-        {"mask_src_port", "mask_src_port", NUMBER, "0", false, false},
-        {"mask_dst_port", "mask_dst_port", NUMBER, "0", false, false},
-        {"compatibility", "compatibility", "ios, nexus", "ios", false, false},
+        {"interface", "interface", "NAME, or none: the first of the appliance", true, false},
+        {"router", "router", "ADDRESS, once for each router; together they are the new list", true, false},
+        {"weight", "weight", nullptr, false, false},
+        {"password", "password", "up to 8 characters; \"\" for none", false, true},
+        {"policy", "policy_grp", "1 to 65535, or none", false, false},
+        {"admin", "admin", nullptr, false, false},
+        {"priority", "priority", nullptr, true, false},
+        {"protocol", "protocol", "a name, or 1 to 255", true, false},
+        {"encap", "encap", nullptr, false, false},
+        {"force_l2_return", "force_l2_return", nullptr, false, false},
+        {"assign", "assign_method", nullptr, false, false},
+        {"detail", "assign_detail", "a text", false, true},
+        {"hash_src_ip", "hash_src_ip", nullptr, false, false},
+        {"hash_dst_ip", "hash_dst_ip", nullptr, false, false},
+        {"hash_src_port", "hash_src_port", nullptr, false, false},
+        {"hash_dst_port", "hash_dst_port", nullptr, false, false},
+        {"mask_src_ip", "mask_src_ip", nullptr, false, false},
+        {"mask_dst_ip", "mask_dst_ip", nullptr, false, false},
+        {"mask_src_port", "mask_src_port", nullptr, false, false},
+        {"mask_dst_port", "mask_dst_port", nullptr, false, false},
+        {"compatibility", "compatibility", nullptr, false, false},
     };
     return words;
+}
+
+static const schema_row *row_of(const group_word &word) {
+    node_name name;
+    return parse_node_name(std::string(GROUPS) + "/0/" + word.node, &name) ? find_schema_row(name) : nullptr;
+}
+
+// What mgmtd has in the place of a node that isn't set; null: the node is absent then.
+static const char *fallback_of(const group_word &word) {
+    const schema_row *row = row_of(word);
+    return row ? row->fallback : nullptr;
+}
+
+static std::string values_of(const group_word &word) {
+    const schema_row *row = row_of(word);
+    if (word.hint || !row)
+        return word.hint ? word.hint : "";
+    if (bn_type_numeric(row->type))
+        return std::to_string(row->min) + " to " + std::to_string(row->max) + ", also as 0x...";
+    return row->words ? row->words : "true|false";
 }
 
 namespace {
@@ -141,7 +162,7 @@ static std::string parse_wish(const std::vector<std::string> &words, wanted_grou
             return unknown_word(words[i], known);
         }
         if (i + 1 == words.size())
-            return std::string("\"") + word->word + "\" needs a value: " + word->values;
+            return std::string("\"") + word->word + "\" needs a value: " + values_of(*word);
         const std::string &value = words[i + 1];
         const bool nothing = !word->free_text && (value == "default" || value == "none");
         if (std::string(word->node) == "router") {
@@ -192,7 +213,8 @@ static bool read_group(const group_link &link, const std::string &root, group_no
             continue;
         const std::string name = binding.name.substr(root.size() + 1);
         const group_word *word = find_word(name);
-        if (!word || !word->fallback || binding.value != word->fallback)
+        const char *fallback = word ? fallback_of(*word) : nullptr;
+        if (!fallback || binding.value != fallback)
             (*out)[name] = binding.value;
     }
     return true;
@@ -374,12 +396,11 @@ static void group_set(const group_link &link, const std::string &root, const wan
     }
     for (const auto &[node, value] : wish.values) {
         const group_word *word = find_word(node);
+        const char *fallback = fallback_of(*word);
+        const auto otherwise = fallback ? std::optional<std::string>(fallback) : std::nullopt;
         const auto old = before.find(node);
-        const std::optional<std::string> stood = old != before.end() ? std::optional(old->second)
-                                                 : word->fallback ? std::optional<std::string>(word->fallback)
-                                                                  : std::nullopt;
-        const std::optional<std::string> to =
-            value || !word->fallback ? value : std::optional<std::string>(word->fallback);
+        const auto stood = old != before.end() ? std::optional(old->second) : otherwise;
+        const auto to = value ? value : otherwise;
         if (to == stood)
             continue;
         if (value)
@@ -388,7 +409,7 @@ static void group_set(const group_link &link, const std::string &root, const wan
             after.erase(node);
         in_place.push_back(
             {value ? ctl_change::modify : ctl_change::reset, {root + "/" + node, "", value.value_or("")}});
-        if (word->whole || (!value && !word->fallback))
+        if (word->whole || (!value && !fallback))
             as_whole += std::string(as_whole.empty() ? "" : ", ") + word->word;
     }
     if (!as_whole.empty()) {
@@ -554,13 +575,14 @@ static int tell(const ctl_options &options, const group_result &result) {
 static int list_words(const ctl_options &options) {
     json all = json::array();
     for (const group_word &word : group_words()) {
+        const char *fallback = fallback_of(word);
         if (!options.json)
-            printf("%-16s %s%s%s\n", word.word, word.values,
-                   word.fallback && *word.fallback ? "; default " : "", word.fallback ? word.fallback : "");
+            printf("%-16s %s%s%s\n", word.word, values_of(word).c_str(),
+                   fallback && *fallback ? "; default " : "", fallback ? fallback : "");
         all.push_back({{"word", word.word},
                        {"node", word.node},
-                       {"values", word.values},
-                       {"default", word.fallback ? json(word.fallback) : json(nullptr)},
+                       {"values", values_of(word)},
+                       {"default", fallback ? json(fallback) : json(nullptr)},
                        {"recreates", word.whole}});
     }
     if (options.json)

@@ -11,10 +11,9 @@
 struct group_word {
     const char *word;
     const char *node; // below the group's root; "router" stands for the list of its entries
-    const char *values;
-    const char *fallback; // what mgmtd has in the node's place; null: the node is absent then
-    bool whole;           // wccpd takes a change only with the group as a whole
-    bool free_text;       // any text is a value, "default" too
+    const char *hint; // of its values; null: as the schema has them
+    bool whole;       // wccpd takes a change only with the group as a whole
+    bool free_text;   // any text is a value, "default" too
 };
 const std::vector<group_word> &group_words();
 
