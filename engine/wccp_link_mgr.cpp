@@ -16,7 +16,10 @@
 // is tried.
 //
 // A notification of an address tells only that something has changed. The kernel is asked for what holds now,
-// so events that come late, twice or in another order end in the same place.
+// so events that come late, twice or in another order end in the same place. One thing the address alone
+// doesn't tell: while a callback waits for the lock, an interface can be deleted and made again under its
+// name with its address. The memberships of its multicast socket went with the old device; so the sockets
+// remember the device that they were opened on, and another one under the same address opens them again.
 
 #include "engine/wccp_link_mgr.h"
 
@@ -181,6 +184,13 @@ static void address_replaced(wccp_interface *interface) {
     wccp_start_service_groups_by_interface(interface);
 }
 
+static void open_on_another_device(wccp_interface *interface) {
+    if (is_zero(interface->ipa) || interface->device == wccp_get_device(interface->name))
+        return;
+    QV_LOG(LC_LOG_INFO, "WCCP: Interface %s was made again: its sockets are opened again", interface->name);
+    wccp_init_network_by_interface(interface);
+}
+
 void wccp_process_if_ipa_update(const void *argument) {
     const auto *name = static_cast<const char *>(argument);
     if (wccpd_shutdown_in_progress() == 1 || !name)
@@ -194,8 +204,10 @@ void wccp_process_if_ipa_update(const void *argument) {
         return;
     }
     const be32 old_ipa = interface->ipa, new_ipa = wccp_get_address(interface->name);
-    if (old_ipa == new_ipa)
+    if (old_ipa == new_ipa) {
+        open_on_another_device(interface);
         return;
+    }
     interface->ipa_change_count++;
     interface->ipa = new_ipa;
     if (is_zero(new_ipa)) {

@@ -172,6 +172,7 @@ int wccp_init_network_by_interface(wccp_interface *interface) {
         QV_LOG(LC_LOG_INFO, "WCCP: net init %s not bound (no IP address)", interface->name);
         return 0;
     }
+    interface->device = wccp_get_device(interface->name);
     if (open_unicast(interface) || open_multicast(interface))
         return 1;
     wccp_config_mcast(interface);
@@ -286,6 +287,11 @@ be32 wccp_get_address(const char *name) {
     sockaddr_in address;
     memcpy(&address, &request.ifr_addr, sizeof address);
     return from_raw_word(address.sin_addr.s_addr);
+}
+
+int32_t wccp_get_device(const char *name) {
+    ifreq request = request_for(name);
+    return ioctl(g_qvif_skfd, SIOCGIFINDEX, &request) == 0 ? request.ifr_ifindex : 0;
 }
 
 uint32_t wccp_get_if_status(const char *name) {

@@ -13,4 +13,5 @@ int32_t wccp_tx_pkt(wccp_service_group *group, wccp_pkt *pkt); // lock held; byt
 // No lock held; blocks for about a second. Bytes received, 0 or less for nothing.
 int32_t wccp_rx_pkt(wccp_interface *interface, wccp_pkt *pkt, uint32_t length);
 be32 wccp_get_address(const char *name);       // 0 when it has none
+int32_t wccp_get_device(const char *name);     // the kernel's index, 0 when there is none
 uint32_t wccp_get_if_status(const char *name); // 1 up and running

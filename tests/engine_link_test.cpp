@@ -161,6 +161,26 @@ TEST_F(Link, AddressAndLinkInEitherOrderEndInReady) {
     }
 }
 
+// Deleted and made again while the notifier waited: what it reads when it gets the lock is the old address.
+TEST_F(Link, AnInterfaceMadeAgainWithItsAddressIsJoinedAgain) {
+    set_address("10.1.0.1");
+    wccp_grp_config config = engine_fixture::group_config(61, {"224.0.1.61"});
+    ASSERT_EQ(wccp_add_group(&config), 0);
+    ASSERT_EQ(wan->mcast_bound, 1u);
+    run_command("ip maddr show dev wan0 | grep -q 224.0.1.61");
+    run_command("ip link del wan0");
+    peer.link("wan0", "10.1.0.1/24", "rt0", "10.1.0.2/24");
+    ASSERT_TRUE(link_becomes("wan0", 1));
+    run_command("! ip maddr show dev wan0 | grep -q 224.0.1.61");
+    wccp_process_if_ipa_update("wan0");
+    EXPECT_EQ(wan->ipa_change_count, 1u);
+    EXPECT_EQ(wan->ready_flags, WCCP_ALL_READY);
+    run_command("ip maddr show dev wan0 | grep -q 224.0.1.61");
+    const int32_t fd = wan->mcast_fd;
+    wccp_process_if_ipa_update("wan0");
+    EXPECT_EQ(wan->mcast_fd, fd) << "the same device: nothing to open";
+}
+
 TEST_F(Link, AnAddressComesChangesAndGoes) {
     wccp_service_group *group = add_group(61), *other = add_group(62);
     EXPECT_TRUE(is_zero(group->appliance_ipa));
