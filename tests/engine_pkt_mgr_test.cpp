@@ -8,12 +8,10 @@
 #include <array>
 #include <cstring>
 
-#include "engine/wccp_pkt_load.h"
 #include "engine/wccp_router_utils.h"
-#include "engine/wccp_state.h"
-#include "engine/wccp_view_utils.h"
 #include "tests/support/engine_fixture.h"
 #include "tests/support/log_lines.h"
+#include "tests/support/reported_group.h"
 #include "tests/support/wire_bytes.h"
 
 namespace {
@@ -94,10 +92,6 @@ protected:
         return wccp_process_received_packet(make_received(message, from).get());
     }
     wccp_sending_router *router(uint8_t id) const { return wccp_find_sending_router(group, ipa(0, id)); }
-    static void pass_seconds(uint32_t seconds) {
-        while (seconds--)
-            wccp_tick();
-    }
     engine_fixture engine;
     wccp_service_group *group = nullptr;
 };
