@@ -1,0 +1,216 @@
+// Messages and bindings a second: writing, reading, a query with its answer over a real socket pair, and a
+// burst of small messages. The floor of each is sending and taking the same bytes over such a pair without
+// looking at them, measured in the same run, turn by turn; `x_floor` says how many times the floor it takes.
+#include <benchmark/benchmark.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <thread>
+
+#include "mgmt/bnode_proto.h"
+#include "mgmt/gcl_records.h"
+#include "mgmt/owners.h"
+#include "tests/support/gcl_provider.h"
+
+namespace {
+
+// Of this thread, the kernel's part included, so that others on the machine don't count.
+using seconds = double;
+seconds now() {
+    timespec time{};
+    clock_gettime(CLOCK_THREAD_CPUTIME_ID, &time);
+    return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9;
+}
+template <typename Step>
+seconds time_of(Step step) {
+    const seconds start = now();
+    step();
+    return now() - start;
+}
+void must(bool condition, const char *what) {
+    if (condition)
+        return;
+    fprintf(stderr, "%s\n", what);
+    exit(1);
+}
+
+struct socket_pair {
+    int ends[2] = {-1, -1};
+    std::string taken = std::string(1 << 18, '\0');
+    socket_pair() { must(socketpair(AF_UNIX, SOCK_STREAM, 0, ends) == 0, "socketpair"); }
+    ~socket_pair() {
+        close(ends[0]);
+        close(ends[1]);
+    }
+    // The bytes go over, as much at a time as the socket holds.
+    void pass(int from, const void *bytes, size_t length) {
+        const auto *at = static_cast<const char *>(bytes);
+        while (length) {
+            const size_t piece = length < 65536 ? length : 65536;
+            must(send(ends[from], at, piece, 0) == static_cast<ssize_t>(piece), "send");
+            for (size_t got = 0; got < piece;)
+                got += static_cast<size_t>(recv(ends[1 - from], taken.data(), piece - got, 0));
+            at += piece;
+            length -= piece;
+        }
+    }
+};
+
+void fill_response(bn_response_msg **out, int64_t bindings) {
+    must(bn_query_response_msg_create(out, 1, 0, nullptr) == LC_OK, "create");
+    (*out)->service_id = 2;
+    for (int64_t i = 0; i < bindings; i++) {
+        bn_binding *binding = nullptr;
+        const std::string name =
+            "/qv/wccpd/wccp/srv_grp/config/" + std::to_string(i / 40) + "/field/" + std::to_string(i % 40);
+        must(bn_binding_new_str(&binding, name.c_str(), bn_attrib_value, bn_type_str, 0, "a value") ==
+                     LC_OK &&
+                 bn_query_response_msg_append_binding_takeover(*out, &binding, 1000) == LC_OK,
+             "binding");
+    }
+}
+
+// Runs `step` and passing `sent` bytes there and `back` bytes back in turns.
+template <typename Step>
+void measure(benchmark::State &state, int64_t messages, int64_t bindings, size_t sent, size_t back,
+             Step step) {
+    socket_pair pair;
+    const std::string bytes(sent > back ? sent : back, 'b');
+    seconds own = 0, floor = 0;
+    for (auto _ : state) {
+        const seconds mine = time_of(step);
+        floor += time_of([&] {
+            pair.pass(0, bytes.data(), sent);
+            pair.pass(1, bytes.data(), back);
+        });
+        own += mine;
+        state.SetIterationTime(mine);
+    }
+    const auto rate = [&](int64_t each) {
+        return benchmark::Counter(static_cast<double>(each * state.iterations()),
+                                  benchmark::Counter::kIsRate);
+    };
+    state.counters["messages"] = rate(messages);
+    state.counters["bindings"] = rate(bindings);
+    state.counters["x_floor"] = own / floor;
+}
+
+void write_message(benchmark::State &state) {
+    owned_response msg;
+    owned_tbuffer first;
+    fill_response(&msg.pointer, state.range(0));
+    must(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &first.pointer) == LC_OK, "write");
+    measure(state, 1, state.range(0), first.pointer->length, 0, [&] {
+        owned_tbuffer buffer;
+        (void)bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &buffer.pointer);
+        benchmark::DoNotOptimize(buffer.pointer);
+    });
+}
+
+void read_message(benchmark::State &state) {
+    owned_response msg;
+    owned_tbuffer bytes;
+    fill_response(&msg.pointer, state.range(0));
+    must(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &bytes.pointer) == LC_OK, "write");
+    measure(state, 1, state.range(0), bytes.pointer->length, 0, [&] {
+        owned_response read;
+        (void)bn_response_msg_deserialize(bytes.pointer, BN_FRAME_HEADER_BYTES, &read.pointer);
+        benchmark::DoNotOptimize(read.pointer);
+    });
+}
+
+// A session, opened, whose provider is this same thread; the loop is played by hand.
+struct opened_session {
+    gcl_provider provider;
+    fdic *interests = nullptr;
+    gcl *instance = nullptr;
+    gcl_session *session = nullptr;
+    int64_t answers = 0, bindings = 0;
+
+    static lc_status ignore_changes(const fdic_event_array *, void *) { return LC_OK; }
+    static lc_status take_answer(gcl_session *, bn_response_msg *msg, void *data) {
+        auto *self = static_cast<opened_session *>(data);
+        owned_bindings bindings;
+        CHECK_STATUS(bn_response_get_takeover(msg, nullptr, nullptr, 0, &bindings.pointer, nullptr));
+        self->answers++;
+        self->bindings += bn_binding_array_length_quick(bindings.pointer);
+        return LC_OK;
+    }
+    opened_session() {
+        must(provider.listen_as("bench") && fdic_init(&interests, ignore_changes, nullptr) == LC_OK &&
+                 gcl_init(&instance, nullptr, interests) == LC_OK &&
+                 bn_set_global_callback_query_response_msg(instance, take_answer, this) == LC_OK &&
+                 gcl_session_client_new(instance, "bench", nullptr, 0, &session) == LC_OK &&
+                 gcl_session_client_connect_by_provider(session, "bench", 0) == LC_OK,
+             "session");
+        std::thread other([this] { must(provider.open_session(), "provider"); });
+        must(gcl_session_client_open_service_blocking(session, 2, 2, nullptr, 0, 3000) == LC_OK, "open");
+        other.join();
+    }
+    ~opened_session() {
+        (void)gcl_deinit(&instance);
+        (void)fdic_deinit(&interests);
+    }
+    void answer(const std::string &frames, int64_t messages) {
+        answers = 0;
+        int idle = 0;
+        for (size_t at = 0; at < frames.size() || (answers < messages && idle < 100);) {
+            const ssize_t sent =
+                send(provider.client, frames.data() + at, frames.size() - at, MSG_DONTWAIT | MSG_NOSIGNAL);
+            at += sent > 0 ? static_cast<size_t>(sent) : 0;
+            idle += at == frames.size();
+            (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_READABLE, session, nullptr);
+        }
+        must(answers == messages, "an answer is missing");
+    }
+    static std::string frame_of(bn_response_msg *msg) {
+        owned_tbuffer bytes;
+        must(bn_response_msg_serialize(msg, 0, &bytes.pointer) == LC_OK, "write");
+        return frame_bytes(
+            BN_PROTO, msg->msg_type,
+            std::string(reinterpret_cast<const char *>(tb_buf(bytes.pointer)), bytes.pointer->length));
+    }
+};
+
+void query_and_answer(benchmark::State &state) {
+    opened_session with;
+    owned_response msg;
+    fill_response(&msg.pointer, state.range(0));
+    const std::string answer = opened_session::frame_of(msg.pointer);
+    std::string question(1024, '\0');
+    size_t sent = 0;
+    const auto ask = [&] {
+        owned_request request;
+        (void)bn_query_request_msg_create(&request.pointer, 0, nullptr);
+        (void)bn_query_request_msg_append_str(request.pointer, bn_query_iterate, bn_qf_subtree,
+                                              "/qv/wccpd/wccp", nullptr);
+        (void)bn_request_msg_send(with.session, request.pointer);
+        sent = static_cast<size_t>(recv(with.provider.client, question.data(), question.size(), 0));
+        with.answer(answer, 1);
+    };
+    ask();
+    measure(state, 2, state.range(0), sent, answer.size(), ask);
+}
+
+// Small messages that come together are taken out of one read.
+void burst(benchmark::State &state) {
+    opened_session with;
+    owned_response msg;
+    fill_response(&msg.pointer, 1);
+    std::string frames;
+    for (int64_t i = 0; i < state.range(0); i++)
+        frames += opened_session::frame_of(msg.pointer);
+    measure(state, state.range(0), state.range(0), 0, frames.size(),
+            [&] { with.answer(frames, state.range(0)); });
+}
+
+#define SIZES ->ArgName("bindings")->Arg(1)->Arg(40)->Arg(1000)->UseManualTime()
+BENCHMARK(write_message) SIZES;
+BENCHMARK(read_message) SIZES;
+BENCHMARK(query_and_answer) SIZES->Arg(10000);
+BENCHMARK(burst)->ArgName("messages")->Arg(10)->Arg(1000)->UseManualTime();
+
+} // namespace
+
+BENCHMARK_MAIN();
