@@ -11,6 +11,8 @@
 //
 // Exit. The groups go first, each with its farewell, then the threads. Notifications that come during the
 // exit are turned away at the door (wccp_link_mgr.cpp), so nobody makes a thread after they have been ended.
+// Datagrams are turned away as well: between the two steps there is no group that they could belong to, and
+// the mailbox has been reset.
 //
 // The platform's notifier thread lives on until the process is gone. What its callbacks can reach, wccp_g
 // above all, is plain memory without a destructor.
@@ -141,6 +143,8 @@ void *wccp_rx_thread_fn(void *argument) {
             continue;
         pkt.length = static_cast<uint32_t>(received);
         const wccp_engine_lock lock;
+        if (wccpd_shutdown_in_progress() == 1)
+            continue;
         wccp_process_received_packet(&pkt);
     }
 }
