@@ -186,24 +186,14 @@ int print_assignment_51(csys_display_buf *buffer) {
 }
 
 // Group 51 as the texts above have it.
-struct EngineDump : testing::Test {
-    reported_group reported{false};
-    wccp_service_group *group = reported.group;
-    wccp_sending_router *router = add_router(host(201));
-
-    wccp_sending_router *add_router(be32 id) const {
-        auto *made = static_cast<wccp_sending_router *>(wccp_malloc(sizeof(wccp_sending_router)));
-        made->router_id = id;
-        list_push_head(&group->sending_routers, made);
-        group->sending_router_count++;
-        return made;
-    }
-
-    EngineDump() {
+struct EngineDump : testing::Test, reported_group {
+    EngineDump() : reported_group(false) {
         wccp_g.seconds = 200000;
         wccp_g.mcast_ttl = 5;
-        reported.interface.link_up = 1;
-        reported.interface.ready_flags = WCCP_IPA_READY;
+        see(ROUTER_A, {ROUTER_A}, {{US, 50}});
+        first = router(ROUTER_A);
+        interface.link_up = 1;
+        interface.ready_flags = WCCP_IPA_READY;
         group->state_flags = WCCP_STATE_ACTIVE | WCCP_CAPABILITIES_SET | WCCP_SHUTTING_DOWN;
         group->state_time = wccp_g.seconds - (86400 + 2 * 3600 + 3 * 60 + 4);
         group->protocol = 6;
@@ -229,48 +219,31 @@ struct EngineDump : testing::Test {
         group->raised_alarms = WCCP_ALARM_ADJACENCY | WCCP_ALARM_ASSIGNMENT;
         group->router_alarm_timer = {1, WCCP_TIMER_COUNTS, 1, 30, 12};
         group->assign_alarm_timer = {0, WCCP_TIMER_COUNTS, 1, 30, 5};
-        uint32_t *const counters[] = {
-            &group->rx_icus,
-            &group->rx_removal_queries,
-            &group->tx_here_i_am,
-            &group->tx_redirect_assign,
-            &group->tx_removal_replies,
-            &group->alarm_router_sched,
-            &group->alarm_assign_sched,
-            &group->rx_unknown_capabilities,
-            &group->rx_failures,
-            &group->tx_failures,
-            &group->rx_service_mismatches,
-            &group->rx_auth_mismatches,
-            &group->rx_auth_failures,
-        };
+        using counter = uint32_t wccp_service_group::*;
         uint32_t value = 1;
-        for (uint32_t *counter : counters)
-            *counter = value++;
+        for (const counter each :
+             {&wccp_service_group::rx_icus, &wccp_service_group::rx_removal_queries,
+              &wccp_service_group::tx_here_i_am, &wccp_service_group::tx_redirect_assign,
+              &wccp_service_group::tx_removal_replies, &wccp_service_group::alarm_router_sched,
+              &wccp_service_group::alarm_assign_sched, &wccp_service_group::rx_unknown_capabilities,
+              &wccp_service_group::rx_failures, &wccp_service_group::tx_failures,
+              &wccp_service_group::rx_service_mismatches, &wccp_service_group::rx_auth_mismatches,
+              &wccp_service_group::rx_auth_failures})
+            group->*each = value++;
 
-        router->src_ipa = host(211);
-        router->receive_id = to_be32(0x12);
-        router->change_number = to_be32(5);
-        router->flags = WCCP_RTR_TWO_WAY | WCCP_RTR_ASSIGN_UNACKED;
-        router->state_time = wccp_g.seconds - 65;
-        router->cap_fwd = 2;
-        router->cap_assign = 4;
-        router->cap_ret = 3;
-        router->view_router_count = router->view_appliance_count = 1;
-        router->view_routers[0] = {host(201), 1};
-        router->view_appliances[0] = {US, 50, 0, 64, 256, {0x01020304, 0, 0, 0, 0, 0, 0, 0x80000000}};
-
-        auto *appliance = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof(wccp_view_appliance)));
-        appliance->ipa = US;
-        appliance->weight = 100;
-        appliance->ref_count = 2;
-        list_push_head(&group->appliance_view, appliance);
-        group->appliance_view_count = 1;
-        auto *seen = static_cast<wccp_view_router *>(wccp_malloc(sizeof(wccp_view_router)));
-        seen->ipa = host(201);
-        seen->ref_count = 3;
-        list_push_head(&group->router_view, seen);
-        group->router_view_count = 1;
+        first->src_ipa = host(211);
+        first->receive_id = to_be32(0x12);
+        first->change_number = to_be32(5);
+        first->flags = WCCP_RTR_TWO_WAY | WCCP_RTR_ASSIGN_UNACKED;
+        first->state_time = wccp_g.seconds - 65;
+        first->cap_fwd = 2;
+        first->cap_assign = 4;
+        first->cap_ret = 3;
+        first->view_routers[0].flags = 1;
+        first->view_appliances[0] = {US, 50, 0, 64, 256, {0x01020304, 0, 0, 0, 0, 0, 0, 0x80000000}};
+        group->appliance_view->weight = 100;
+        group->appliance_view->ref_count = 2;
+        group->router_view->ref_count = 3;
 
         group->mask_src_ip = 0x1741;
         group->mask_dst_port = 1;
@@ -285,17 +258,30 @@ struct EngineDump : testing::Test {
         wccp_g.stat_alloc_fails = 2;
         wccp_g.rx_failures = 17;
     }
+    wccp_sending_router *first;
 };
 
 const std::string HASH_TEXT = ASSIGNMENT_HEAD + HASH_DESIGNATOR + HASH_ROUTERS;
 
-TEST_F(EngineDump, TheWholeTextOfOneGroup) {
-    const std::string head = "\n*******   WCCP GROUP 51 INFO START **********\n",
+TEST_F(EngineDump, TheWholeTexts) {
+    const std::string begin = "\n*******   WCCP GROUP 51 INFO START **********\n",
                       middle = "    ******* WCCP GROUP 51 ASSIGNMENT INFO ******\n",
-                      end = "\n*******   WCCP GROUP 51 INFO END **********\n";
-    const dump one = dump_of(WCCP_DUMP_GROUP_BYTES, print_51);
-    EXPECT_EQ(one.result, 0);
-    EXPECT_EQ(one.text, closed(head + GROUP_TEXT + middle + HASH_TEXT + STATS_TEXT + end, one.max));
+                      end = "\n*******   WCCP GROUP 51 INFO END **********\n",
+                      begin_all = "\n\n************** WCCP GROUP ID 51 START ************\n",
+                      end_all = "************** WCCP GROUP ID 51 END **************\n";
+    const auto matches = [](uint32_t size, int (*print)(csys_display_buf *), const std::string &text) {
+        const dump found = dump_of(size, print);
+        EXPECT_EQ(found.result, 0);
+        EXPECT_EQ(found.text, closed(text, found.max));
+    };
+    matches(WCCP_DUMP_GROUP_BYTES, print_51, begin + GROUP_TEXT + middle + HASH_TEXT + STATS_TEXT + end);
+    matches(WCCP_DUMP_GLOBAL_BYTES, wccp_print_global, GLOBAL_TEXT);
+    matches(WCCP_DUMP_ALL_BYTES, wccp_print_all_wccp_info,
+            GLOBAL_TEXT + begin_all + GROUP_TEXT + "\n" + middle + HASH_TEXT + STATS_TEXT + end_all);
+    wccp_service_group *const list = wccp_g.group_list;
+    wccp_g.group_list = nullptr;
+    matches(WCCP_DUMP_ALL_BYTES, wccp_print_all_wccp_info, GLOBAL_TEXT);
+    wccp_g.group_list = list;
 
     const dump assignment = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51);
     EXPECT_EQ(assignment.result, 0);
@@ -303,48 +289,25 @@ TEST_F(EngineDump, TheWholeTextOfOneGroup) {
     EXPECT_EQ(wccp_print_service_grp_assignment_details(51, nullptr), 1);
 }
 
-TEST_F(EngineDump, AllGroupsAndTheGlobalCounters) {
-    const dump global = dump_of(WCCP_DUMP_GLOBAL_BYTES, wccp_print_global);
-    EXPECT_EQ(global.result, 0);
-    EXPECT_EQ(global.text, closed(GLOBAL_TEXT, global.max));
-
-    const dump all = dump_of(WCCP_DUMP_ALL_BYTES, wccp_print_all_wccp_info);
-    EXPECT_EQ(all.result, 0);
-    EXPECT_EQ(all.text,
-              closed(GLOBAL_TEXT + "\n\n************** WCCP GROUP ID 51 START ************\n" + GROUP_TEXT +
-                         "\n    ******* WCCP GROUP 51 ASSIGNMENT INFO ******\n" + HASH_TEXT + STATS_TEXT +
-                         "************** WCCP GROUP ID 51 END **************\n",
-                     all.max));
-
-    wccp_service_group *const list = wccp_g.group_list;
-    wccp_g.group_list = nullptr;
-    const dump none = dump_of(WCCP_DUMP_ALL_BYTES, wccp_print_all_wccp_info);
-    EXPECT_EQ(none.result, 0);
-    EXPECT_EQ(none.text, closed(GLOBAL_TEXT, none.max));
-    wccp_g.group_list = list;
-}
-
 TEST_F(EngineDump, AGroupThatDoesNotExist) {
     log_lines log;
-    const dump missing =
-        dump_of(WCCP_DUMP_GROUP_BYTES, [](csys_display_buf *b) { return wccp_print_service_grp(b, 7); });
+    const dump missing = dump_of(100, [](csys_display_buf *b) { return wccp_print_service_grp(b, 7); });
     EXPECT_EQ(missing.result, 1);
     EXPECT_EQ(missing.text, "\n    group 7 does not exist!\n");
-    const dump assignment = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, [](csys_display_buf *b) {
-        return wccp_print_service_grp_assignment_details(7, b);
-    });
+    const dump assignment =
+        dump_of(100, [](csys_display_buf *b) { return wccp_print_service_grp_assignment_details(7, b); });
     EXPECT_EQ(assignment.result, 1);
     EXPECT_EQ(assignment.text, "");
-    EXPECT_NE(log.take().find("WCCP GRP 7: show assignment: cannot find group id 7"), std::string::npos);
+    EXPECT_TRUE(log.say("WCCP GRP 7: show assignment: cannot find group id 7"));
 }
 
 TEST_F(EngineDump, WhatTheDesignatorComputed) {
+    const auto text = [] { return dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text; };
     // Alone with all buckets.
     group->dsg_active_count = 1;
     std::fill(group->bucket_ipa, group->bucket_ipa + WCCP_MAX_BUCKETS, US);
     const std::string full = "\t                           : 0xffffffff ffffffff ffffffff ffffffff\n";
-    EXPECT_NE(dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text.find(full + full + "\n"),
-              std::string::npos);
+    EXPECT_NE(text().find(full + full + "\n"), std::string::npos);
 
     // Masks in place of buckets.
     group->assign_method = WCCP_ASSIGN_MASK;
@@ -358,26 +321,23 @@ TEST_F(EngineDump, WhatTheDesignatorComputed) {
     std::string head = ASSIGNMENT_HEAD;
     head.replace(head.find("either"), 6, "unknown");
     head.replace(head.rfind("hash"), 4, "mask");
-    EXPECT_EQ(dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text,
-              head + MASK_DESIGNATOR + MASK_ROUTERS);
+    EXPECT_EQ(text(), head + MASK_DESIGNATOR + MASK_ROUTERS);
 
     // Another's computation isn't shown, what the routers report still is; no buckets make no share.
     group->designated = 0;
-    router->view_appliances[0].buckets_total = 0;
+    first->view_appliances[0].buckets_total = 0;
     std::string shareless = MASK_ROUTERS;
     shareless.replace(shareless.find("25 %"), 4, "0 %");
-    EXPECT_EQ(dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text,
-              head + "\n\tDesignator allocation      : not the designator \n\n" + shareless);
+    EXPECT_EQ(text(), head + "\n\tDesignator allocation      : not the designator \n\n" + shareless);
 
     // Nothing agreed: neither rows of buckets nor of values.
     group->assign_method = WCCP_ASSIGN_NONE;
-    const std::string none = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text;
-    EXPECT_NE(none.find("Negotiated assign. method  : not set\n"), std::string::npos);
-    EXPECT_EQ(none.find("Rxed "), std::string::npos);
+    EXPECT_NE(text().find("Negotiated assign. method  : not set\n"), std::string::npos);
+    EXPECT_EQ(text().find("Rxed "), std::string::npos);
 }
 
 TEST_F(EngineDump, WordsForOtherStates) {
-    const auto row = [&](const std::string &label) {
+    const auto row = [](const std::string &label) {
         const std::string text = dump_of(WCCP_DUMP_GROUP_BYTES, print_51).text;
         const size_t at = text.find("    " + label) + 39;
         return text.substr(at, text.find('\n', at) - at);
@@ -390,14 +350,13 @@ TEST_F(EngineDump, WordsForOtherStates) {
     EXPECT_EQ(row("WCCP raised alarms"), "none");
     group->raised_alarms = WCCP_ALARM_ASSIGNMENT;
     EXPECT_EQ(row("WCCP raised alarms"), "flag: 0x2 assign tbl mismatch");
-    router->flags = WCCP_RTR_ONE_WAY;
+    first->flags = WCCP_RTR_ONE_WAY;
     EXPECT_EQ(row("WCCP router connected"), "one-way");
     memset(group->password, 0, sizeof group->password);
     EXPECT_EQ(row("WCCP password"), " 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, ");
-    reported.interface.link_up = 0;
+    interface.link_up = 0;
     EXPECT_EQ(row("WCCP interface ipa and link"), "10.0.0.1 down ");
-    reported.interface.ready_flags = WCCP_LINK_READY;
-    EXPECT_EQ(row("WCCP interface ready flags"), "ipa: no link: ok track intf: no ");
+    interface.ready_flags = WCCP_LINK_READY;
     wccp_interface primary = {};
     wccp_g.primary_if = &primary;
     EXPECT_EQ(row("WCCP interface ready flags"), "ipa: no link: ok track intf: no ");
@@ -414,9 +373,7 @@ TEST_F(EngineDump, WordsForOtherStates) {
 
 // However small the buffer: the beginning of the text, closed by a newline, and the result 1.
 TEST_F(EngineDump, EverySizeThatIsTooSmall) {
-    const std::function<int(csys_display_buf *)> prints[] = {wccp_print_global, wccp_print_all_wccp_info,
-                                                             print_51, print_assignment_51};
-    for (const auto &print : prints) {
+    for (const auto print : {wccp_print_global, wccp_print_all_wccp_info, print_51, print_assignment_51}) {
         const dump whole = dump_of(WCCP_DUMP_ALL_BYTES, print);
         ASSERT_EQ(whole.result, 0);
         const uint32_t overhead = WCCP_DUMP_ALL_BYTES - whole.max;
@@ -433,49 +390,55 @@ TEST_F(EngineDump, EverySizeThatIsTooSmall) {
 }
 
 TEST_F(EngineDump, WhatTheLogSaysOfAFullBuffer) {
+    static const struct {
+        uint32_t size;
+        int (*print)(csys_display_buf *);
+        std::vector<const char *> lines;
+    } cases[] = {
+        {100, wccp_print_global, {"WCCP: printing global info failed. status (1) length ("}},
+        {100,
+         wccp_print_all_wccp_info,
+         {"WCCP display print failed. wccp_print_global_info", "WCCP: printing global info failed."}},
+        {600, wccp_print_all_wccp_info, {"WCCP: print all failed failed. status  (1) length ("}},
+        {1000, print_51, {"WCCP: print service group failed failed."}},
+        {2500,
+         print_51,
+         {"WCCP: printing sending router failed. length (", // at both levels
+          "WCCP: printing sending router failed. status  (1) length ("}},
+        {100,
+         print_assignment_51,
+         {"WCCP bail on zero : wccp_print_service_grp_assignment_global ",
+          "WCCP: show assignment global failed.", "WCCP: show assignment failed failed."}},
+    };
     log_lines log;
-    const auto said = [&](const std::string &line) { return log.take().find(line) != std::string::npos; };
-    EXPECT_EQ(dump_of(100, wccp_print_global).result, 1);
-    EXPECT_TRUE(said("WCCP: printing global info failed. status (1) length ("));
-    EXPECT_EQ(dump_of(100, wccp_print_all_wccp_info).result, 1);
-    EXPECT_TRUE(said("WCCP: printing global info failed."));
-    EXPECT_EQ(dump_of(600, wccp_print_all_wccp_info).result, 1);
-    EXPECT_TRUE(said("WCCP: print all failed failed. status  (1) length ("));
-    EXPECT_EQ(dump_of(1000, print_51).result, 1);
-    EXPECT_TRUE(said("WCCP: print service group failed failed."));
-    EXPECT_EQ(dump_of(2500, print_51).result, 1);
-    EXPECT_TRUE(said("WCCP: printing sending router failed. status  (1) length ("));
-    EXPECT_EQ(dump_of(100, print_assignment_51).result, 1);
-    const std::string lines = log.take();
-    EXPECT_NE(lines.find("WCCP bail on zero : wccp_print_service_grp_assignment_global "), std::string::npos);
-    EXPECT_NE(lines.find("WCCP: show assignment global failed."), std::string::npos);
-    EXPECT_NE(lines.find("WCCP: show assignment failed failed."), std::string::npos);
+    for (const auto &c : cases) {
+        EXPECT_EQ(dump_of(c.size, c.print).result, 1);
+        const std::string said = log.take();
+        for (const char *line : c.lines)
+            EXPECT_NE(said.find(line), std::string::npos) << line << " in\n" << said;
+    }
 }
 
 TEST_F(EngineDump, ThirtyTwoRoutersWithThirtyTwoAppliances) {
     while (group->sending_router_count < WCCP_MAX_ROUTERS)
-        add_router(host(10 + group->sending_router_count));
+        router(host(10 + group->sending_router_count));
     for (wccp_sending_router *each = group->sending_routers; each; each = each->next) {
         each->view_router_count = WCCP_MAX_ROUTERS;
         each->view_appliance_count = WCCP_MAX_APPLIANCES;
     }
     for (const uint32_t method : {WCCP_ASSIGN_HASH, WCCP_ASSIGN_MASK}) {
         group->assign_method = method;
-        const dump one = dump_of(WCCP_DUMP_GROUP_BYTES, print_51);
-        EXPECT_EQ(one.result, 1);
-        EXPECT_EQ(one.text.size(), one.max);
-        EXPECT_EQ(one.text.back(), '\n');
-        const dump assignment = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51);
-        EXPECT_EQ(assignment.result, 1);
-        EXPECT_EQ(assignment.text.size(), assignment.max);
-        EXPECT_EQ(assignment.text.back(), '\n');
-
+        for (const auto &cut : {dump_of(WCCP_DUMP_GROUP_BYTES, print_51),
+                                dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51)}) {
+            EXPECT_EQ(cut.result, 1);
+            EXPECT_EQ(cut.text.size(), cut.max);
+            EXPECT_EQ(cut.text.back(), '\n');
+        }
         const dump whole = dump_of(4u << 20, print_51);
         EXPECT_EQ(whole.result, 0);
-        EXPECT_EQ(count_of(whole.text, "WCCP view app.id/weight/flags"), 1024);
-        EXPECT_EQ(count_of(whole.text, "WCCP view router id/flags"), 1024);
-        EXPECT_EQ(count_of(whole.text, "WCCP rx bucket bits 128-255"), 1024);
-        EXPECT_EQ(count_of(whole.text, "Router id"), 1024);
+        for (const char *row : {"WCCP view app.id/weight/flags", "WCCP view router id/flags",
+                                "WCCP rx bucket bits 128-255", "Router id"})
+            EXPECT_EQ(count_of(whole.text, row), 1024);
         EXPECT_NE(whole.text.find("WCCP ICU sending router ** : # 32\n"), std::string::npos);
     }
 }
