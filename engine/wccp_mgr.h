@@ -77,7 +77,6 @@ enum : uint8_t { WCCP_TIMER_REPEATS = 1, WCCP_TIMER_COUNTS = 2 };
 struct wccp_interface {
     char name[WCCP_IF_NAME_BYTES];
     be32 ipa;
-    int32_t device; // the kernel's index of the device that the sockets were opened on, 0 for none
     uint32_t link_up;
     uint32_t ready_flags;
     int32_t ucast_fd; // -1 closed; see wccp_network.cpp for the lock under which the descriptors change
@@ -90,6 +89,7 @@ struct wccp_interface {
     uint32_t start_count;
     uint32_t link_down_count;
     uint32_t ipa_change_count;
+    int32_t device; // the kernel's index of the device that the sockets were opened on, 0 for none
 };
 
 struct wccp_dsg_appliance {

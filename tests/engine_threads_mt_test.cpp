@@ -16,8 +16,7 @@
 #include <chrono>
 #include <cstring>
 #include <fstream>
-#include <new>
-#include <set>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -32,18 +31,14 @@
 #include "engine/wccp_wire.h"
 #include "engine/wccpd_common.h"
 #include "runtime/common.h"
+#include "tests/support/engine_fixture.h"
 #include "tests/support/fake_tunneld.h"
-#include "tests/support/peer_network.h"
 #include "tests/support/wire_bytes.h"
 
 using namespace std::chrono_literals;
 using steady = std::chrono::steady_clock;
 
 namespace {
-
-be32 ipa(const std::string &text) {
-    return from_raw_word(address_word(text));
-}
 
 struct watchdog {
     explicit watchdog(std::chrono::seconds limit)
@@ -111,52 +106,49 @@ enum method { GRE = 1, L2 = 2 }; // a router of the first kind needs a tunnel
 // I-See-You of a router that sees this appliance: no security, hash, no assignment yet.
 std::vector<uint8_t> i_see_you(uint8_t id, const std::string &router, const std::string &appliance,
                                method way = GRE) {
-    const uint32_t router_word = ntohl(address_word(router)), appliance_word = ntohl(address_word(appliance));
+    const uint32_t from = ntohl(address_word(router)), to = ntohl(address_word(appliance));
     wire_bytes security, service, identity, view, capabilities;
-    security.u16(0).u16(4).u32(0);
-    service.u16(1).u16(24).u8(1).u8(id).zeros(22);
-    identity.u16(2).u16(20).u32(router_word).u32(1).u32(appliance_word).u32(1).u32(appliance_word);
-    view.u16(4).u16(20 + 4 + 44).u32(1).u32(0).u32(0).u32(1).u32(router_word).u32(1);
-    view.u32(appliance_word).zeros(40);
-    capabilities.u16(8).u16(24).u16(1).u16(4).u32(way).u16(2).u16(4).u32(1).u16(3).u16(4).u32(way);
+    security.hex("0000 0004 00000000");
+    service.hex("0001 0018 01").u8(id).zeros(22);
+    identity.hex("0002 0014").u32(from).u32(1).u32(to).u32(1).u32(to);
+    view.hex("0004 0044 00000001 00000000 00000000 00000001").u32(from).u32(1).u32(to).zeros(40);
+    capabilities.hex("0008 0018 0001 0004").u32(way).hex("0002 0004 00000001 0003 0004").u32(way);
     return wire_message(11, {security, service, identity, view, capabilities});
 }
 
 class Threads : public testing::Test {
 protected:
     void SetUp() override {
-        wccpd_exiting = 0;
-        new (&wccp_g) wccp_global{};
-        wccp_g.mcast_ttl = 5;
-        wccp_init_network();
+        fresh_engine();
         write_mem_conf();
         ASSERT_EQ(wccp_init_shmem(), 0);
+        tunneld.emplace(tunneld_does);
         strlcpy(wccp_primary_wan_interface_name, "wan0", sizeof wccp_primary_wan_interface_name);
         peer.link("wan0", "10.1.0.1/24", "rt0", "10.1.0.2/24");
         peer.link("wan1", "10.2.0.1/24", "rt1", "10.2.0.2/24");
-        ASSERT_TRUE(soon([] { return wccp_get_if_status("wan0") && wccp_get_if_status("wan1"); }));
+        ASSERT_TRUE(link_becomes("wan0", 1) && link_becomes("wan1", 1));
+        first = peer.udp_socket("10.1.0.2", 2048);
+        second = peer.udp_socket("10.2.0.2", 2048);
     }
     void TearDown() override {
-        cthread_cancel_all();
-        wccp_del_all_groups();
-        wccp_deinit_link_mgr();
-        wccp_del_all_tunnels();
-        run_command("ip link del wan0");
-        run_command("ip link del wan1");
-        EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
+        end_engine();
+        close(first);
+        close(second);
+        run_command("ip link del wan0 && ip link del wan1");
     }
 
     static wccp_service_group *add_group(uint8_t id, const char *interface) {
-        wccp_grp_config config = {};
-        config.group_id = id;
-        config.admin = WCCP_ADMIN_UP;
+        wccp_grp_config config = engine_fixture::group_config(id, {});
         config.fwd_method = WCCP_METHOD_EITHER;
-        config.assign_method = WCCP_ASSIGN_EITHER;
-        config.compatibility = WCCP_COMPAT_IOS;
-        config.interface_set = 1;
         strlcpy(config.interface, interface, sizeof config.interface);
         EXPECT_EQ(wccp_add_group(&config), 0);
         return wccp_find_group(id);
+    }
+    // Only here: in the daemon no second receive thread is made.
+    static void make_another_receiver(wccp_interface *interface) {
+        const wccp_engine_lock lock;
+        interface->rx_thread = nullptr;
+        EXPECT_EQ(wccp_init_network_by_interface(interface), 0);
     }
     static uint32_t router_count(uint8_t id) {
         const wccp_engine_lock lock;
@@ -169,61 +161,56 @@ protected:
                   0);
     }
 
+    const watchdog dog{240s};
+    std::optional<fake_tunneld> tunneld; // from the moment that there is a mailbox
     peer_network peer;
+    int first = -1, second = -1; // a router's socket on each of the networks
 };
 
 // The stop holds the engine lock while it waits for tunneld; the packets that come in meanwhile are in the
 // hands of receive threads that wait for the lock. None of them may reach a group that has been stopped.
 TEST_F(Threads, BridgeModeWhileReceiversWaitForTheLock) {
-    const watchdog dog(60s);
-    fake_tunneld tunneld(tunneld_does);
     add_group(61, "wan0");
     add_group(62, "wan1");
     start_timer_thread();
-    const int first = peer.udp_socket("10.1.0.2", 2048), second = peer.udp_socket("10.2.0.2", 2048);
     send_datagram(first, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
     ASSERT_TRUE(soon([] { return router_count(61) == 1; }));
     ASSERT_TRUE(soon([] { return engine_tasks().size() == 3; })); // a thread names itself when it first runs
 
-    tunneld.answer_with(tunneld_is_silent);
+    tunneld->answer_with(tunneld_is_silent);
     std::atomic<bool> stopped = false;
     std::thread manager([&] {
         EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0);
         stopped = true;
     });
-    tunneld.wait_for_command(); // the delete of the router's tunnel
+    tunneld->wait_for_command(); // the delete of the router's tunnel
     send_datagram(first, "10.1.0.1", 2048, i_see_you(61, "10.1.0.3", "10.1.0.1"));
     send_datagram(second, "10.2.0.1", 2048, i_see_you(62, "10.2.0.2", "10.2.0.1", L2));
     std::this_thread::sleep_for(200ms);
     EXPECT_FALSE(stopped);
-    tunneld.take_commands();
-    tunneld.answer_with(tunneld_does);
+    tunneld->take_commands();
+    tunneld->answer_with(tunneld_does);
     manager.join();
 
     EXPECT_EQ(engine_tasks().size(), 0u);
     EXPECT_TRUE(lock_is_free());
     EXPECT_EQ(router_count(61), 0u);
     EXPECT_EQ(router_count(62), 0u);
-    for (const seen_command &command : tunneld.take_commands())
+    for (const seen_command &command : tunneld->take_commands())
         EXPECT_NE(command.code, MAILBOX_ADD_TUNNEL);
     const uint32_t seconds = wccp_g.seconds;
     std::this_thread::sleep_for(1200ms);
     EXPECT_EQ(wccp_g.seconds, seconds);
     EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0) << "nothing is left to be stopped";
-    close(first);
-    close(second);
 }
 
 // The waiting itself, again and again: whoever of them gets the lock first, all end.
 TEST_F(Threads, BridgeModeUnderAFlood) {
-    const watchdog dog(120s);
-    fake_tunneld tunneld(tunneld_does);
-    const int router = peer.udp_socket("10.1.0.2", 2048);
     std::atomic<bool> over = false;
     std::thread flood([&] {
         while (!over)
             for (const char *id : {"10.1.0.2", "10.1.0.3", "10.1.0.4"})
-                send_datagram(router, "10.1.0.1", 2048, i_see_you(61, id, "10.1.0.1", L2));
+                send_datagram(first, "10.1.0.1", 2048, i_see_you(61, id, "10.1.0.1", L2));
     });
     for (int round = 0; round < 30; round++) {
         add_group(61, "wan0");
@@ -234,27 +221,21 @@ TEST_F(Threads, BridgeModeUnderAFlood) {
         EXPECT_EQ(router_count(61), 0u);
         EXPECT_TRUE(lock_is_free());
         wccp_del_group(61);
-        wan->rx_thread = nullptr; // only here: in the daemon no second one is made
-        const wccp_engine_lock lock;
-        wccp_init_network_by_interface(wan);
+        make_another_receiver(wan);
     }
     over = true;
     flood.join();
-    close(router);
 }
 
 #ifndef __SANITIZE_THREAD__ // which loses count of the locks when a wait inside it is unwound
 // A receive thread that waits for an absent tunneld has the engine lock and the mailbox's. Cancelled where it
 // stands, it ends at once and takes nothing along.
 TEST_F(Threads, CancelledWhileItWaitsForTunneld) {
-    const watchdog dog(60s);
-    fake_tunneld tunneld(tunneld_does);
-    const int router = peer.udp_socket("10.1.0.2", 2048);
     add_group(61, "wan0");
-    tunneld.take_commands();
-    tunneld.answer_with(tunneld_is_silent);
-    send_datagram(router, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
-    tunneld.wait_for_command();
+    tunneld->take_commands();
+    tunneld->answer_with(tunneld_is_silent);
+    send_datagram(first, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
+    tunneld->wait_for_command();
     EXPECT_FALSE(lock_is_free());
     const auto before = steady::now();
     cthread_cancel_all();
@@ -262,34 +243,26 @@ TEST_F(Threads, CancelledWhileItWaitsForTunneld) {
     EXPECT_TRUE(lock_is_free());
     EXPECT_EQ(wccp_mailbox->command.load(), MAILBOX_IDLE) << "the add is withdrawn";
     EXPECT_EQ(router_count(61), 0u);
-    tunneld.answer_with(tunneld_does);
+    tunneld->answer_with(tunneld_does);
     EXPECT_EQ(wccp_add_tunnel(61, ipa("10.1.0.1"), ipa("10.1.0.9")), 0)
         << "tunnel mutex and mailbox are free";
     wccp_del_group(61);
-    close(router);
 }
 #endif
 
 // The whole exit, with the reset of the mailbox and without: the groups wait for the lock, but in bounded
 // time.
 TEST_F(Threads, ExitWhileAReceiverWaitsForAnAbsentTunneld) {
-    const watchdog dog(60s);
-    fake_tunneld tunneld(tunneld_is_silent);
-    const int router = peer.udp_socket("10.1.0.2", 2048);
-
     for (const bool reset : {false, true}) {
         wccpd_exiting = 0;
-        if (wccp_interface *again = wccp_if_find_interface("wan0")) {
-            again->rx_thread = nullptr; // only here: in the daemon no second one is made
-            const wccp_engine_lock lock;
-            ASSERT_EQ(wccp_init_network_by_interface(again), 0);
-        }
-        tunneld.answer_with(tunneld_does);
+        if (wccp_interface *again = wccp_if_find_interface("wan0"))
+            make_another_receiver(again);
+        tunneld->answer_with(tunneld_does);
         const wccp_interface *wan = add_group(61, "wan0")->interfaces[0];
         start_timer_thread();
-        tunneld.answer_with(tunneld_is_silent);
-        send_datagram(router, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
-        tunneld.wait_for_command();
+        tunneld->answer_with(tunneld_is_silent);
+        send_datagram(first, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
+        tunneld->wait_for_command();
         wccpd_exiting = 1;
         const auto before = steady::now();
         if (reset)
@@ -301,17 +274,14 @@ TEST_F(Threads, ExitWhileAReceiverWaitsForAnAbsentTunneld) {
         EXPECT_EQ(wccp_g.group_count, 0u);
         EXPECT_EQ(wan->ucast_fd, -1);
     }
-    close(router);
 }
 
-// A notification that waited for the lock through the beginning of an exit opens nothing and starts nobody.
-TEST_F(Threads, ANotificationThatComesThroughAnExit) {
-    const watchdog dog(60s);
-    fake_tunneld tunneld(tunneld_does);
+// What waited for the lock through the beginning of an exit opens nothing, starts nobody and tells nothing.
+TEST_F(Threads, NotificationsAndADatagramThatComeThroughAnExit) {
     wccp_service_group *group = add_group(61, "wan0");
     wccp_interface *wan = group->interfaces[0];
-    run_command(
-        "ip addr add 10.1.0.9/24 dev wan0 && ip addr del 10.1.0.1/24 dev wan0 && ip addr flush dev wan1");
+    run_command("ip addr add 10.1.0.9/24 dev wan0 && ip addr del 10.1.0.1/24 dev wan0 && "
+                "ip addr flush dev wan1 && ip addr add 10.1.0.1/32 dev lo");
     std::thread address, link;
     std::atomic<int> asked = 0;
     {
@@ -326,14 +296,17 @@ TEST_F(Threads, ANotificationThatComesThroughAnExit) {
             wccp_process_if_state_change(&info);
         });
         ASSERT_TRUE(soon([&] { return asked == 2; }));
+        send_datagram(first, "10.1.0.1", 2048, i_see_you(62, "10.1.0.2", "10.1.0.1")); // nobody's group
         std::this_thread::sleep_for(100ms);
         wccpd_exiting = 1;
     }
-    EXPECT_EQ(wccp_exit_mgr(), 0);
     address.join();
     link.join();
-    EXPECT_EQ(wan->ipa_change_count, 0u);
-    EXPECT_EQ(wan->link_down_count, 0u);
+    std::this_thread::sleep_for(50ms);
+    EXPECT_EQ(wccp_exit_mgr(), 0);
+    EXPECT_EQ(wccp_g.rx_failures, 0u);
+    run_command("ip addr del 10.1.0.1/32 dev lo");
+    EXPECT_TRUE(wan->ipa_change_count == 0 && wan->link_down_count == 0);
     EXPECT_EQ(engine_tasks().size(), 0u);
     EXPECT_EQ(wan->ucast_fd, -1);
 }
@@ -342,12 +315,10 @@ volatile sig_atomic_t signals_taken;
 
 // While signals pour in on the process, the engine's seconds stay seconds.
 TEST_F(Threads, SignalsDontMakeTheClockRun) {
-    const watchdog dog(60s);
     struct sigaction action = {}, before = {};
     action.sa_handler = [](int) { signals_taken = signals_taken + 1; };
     action.sa_flags = SA_RESTART;
     sigaction(SIGUSR1, &action, &before);
-    fake_tunneld tunneld(tunneld_does);
     start_timer_thread();
     add_group(61, "wan0"); // and a receive thread
     ASSERT_TRUE(soon([] { return engine_tasks().size() == 2; }));
@@ -359,21 +330,17 @@ TEST_F(Threads, SignalsDontMakeTheClockRun) {
     sigemptyset(&blocked);
     sigaddset(&blocked, SIGUSR1);
     pthread_sigmask(SIG_BLOCK, &blocked, &open);
-    const uint32_t start = [] {
+    const auto now = [] {
         const wccp_engine_lock lock;
         return wccp_g.seconds;
-    }();
+    };
+    const uint32_t start = now();
     for (int i = 0; i < 300; i++) {
         kill(getpid(), SIGUSR1);
         std::this_thread::sleep_for(10ms);
     }
-    uint32_t ticks;
-    {
-        const wccp_engine_lock lock;
-        ticks = wccp_g.seconds - start;
-    }
-    EXPECT_GE(ticks, 2u);
-    EXPECT_LE(ticks, 4u);
+    const uint32_t ticks = now() - start;
+    EXPECT_TRUE(ticks >= 2 && ticks <= 4) << ticks;
     pthread_sigmask(SIG_SETMASK, &open, nullptr);
     sigaction(SIGUSR1, &before, nullptr);
 }
@@ -422,11 +389,8 @@ struct bystander {
 };
 
 TEST_F(Threads, AddressesChangeAThousandTimesUnderTheReceivers) {
-    const watchdog dog(240s);
-    fake_tunneld tunneld(tunneld_does);
-    for (const auto &[id, name] : {std::pair<uint8_t, const char *>{61, "wan0"}, {62, "wan1"}})
-        add_group(id, name);
-    const int first = peer.udp_socket("10.1.0.2", 2048), second = peer.udp_socket("10.2.0.2", 2048);
+    add_group(61, "wan0");
+    add_group(62, "wan1");
     std::atomic<bool> over = false;
     std::thread flood([&] {
         while (!over) {
@@ -455,28 +419,22 @@ TEST_F(Threads, AddressesChangeAThousandTimesUnderTheReceivers) {
     EXPECT_GT(others.looked, 1000u);
     // Both receivers are alive, and read what comes for the address of now.
     EXPECT_EQ(engine_tasks().size(), 2u);
-    for (const uint8_t id : {uint8_t{61}, uint8_t{62}}) {
-        const uint32_t seen = [id] {
-            const wccp_engine_lock lock;
-            return wccp_find_group(id)->rx_icus;
-        }();
-        send_datagram(id == 61 ? first : second, id == 61 ? "10.1.0.1" : "10.2.0.1", 2048,
-                      i_see_you(id, id == 61 ? "10.1.0.2" : "10.2.0.2", id == 61 ? "10.1.0.1" : "10.2.0.1"));
-        EXPECT_TRUE(soon([id, seen] {
-            const wccp_engine_lock lock;
-            return wccp_find_group(id)->rx_icus > seen;
-        })) << int{id};
-    }
-    close(first);
-    close(second);
+    const auto icus_of = [](uint8_t id) {
+        const wccp_engine_lock lock;
+        return wccp_find_group(id)->rx_icus;
+    };
+    const uint32_t seen[] = {icus_of(61), icus_of(62)};
+    send_datagram(first, "10.1.0.1", 2048, i_see_you(61, "10.1.0.2", "10.1.0.1"));
+    send_datagram(second, "10.2.0.1", 2048, i_see_you(62, "10.2.0.2", "10.2.0.1"));
+    EXPECT_TRUE(soon([&] { return icus_of(61) > seen[0] && icus_of(62) > seen[1]; }));
 }
 
 // Last, since the library's thread stays for good: the engine's own start, real notifications, and its end.
 TEST_F(Threads, ZTheWholeEngineFollowsTheKernel) {
-    const watchdog dog(60s);
+    tunneld.reset();
     write_mem_conf(); // the engine starts here as a process of its own
     ASSERT_EQ(wccp_init_mgr(), 0);
-    fake_tunneld tunneld(tunneld_does);
+    tunneld.emplace(tunneld_does);
     ASSERT_EQ(wccp_g.primary_if, wccp_if_find_interface("wan0"));
     wccp_service_group *group = add_group(61, "wan0");
     const auto locked = [](auto condition) {

@@ -13,6 +13,7 @@
 #include "engine/wccp_host.h"
 #include "engine/wccp_link_mgr.h"
 #include "engine/wccp_network.h"
+#include "engine/wccp_tunnel.h"
 
 #ifdef WCCP_SANITIZED
 #include <sanitizer/asan_interface.h>
@@ -53,6 +54,7 @@ void end_engine() {
     wccp_del_all_groups();
     EXPECT_EQ(wccp_g.group_count, 0u);
     EXPECT_EQ(wccp_g.group_list, nullptr);
+    wccp_del_all_tunnels();
     EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
     wccp_deinit_link_mgr();
 }

@@ -15,7 +15,7 @@ extern int test_host_bridge_mode;
 
 // The engine's record as its start leaves it: mcast_ttl 5, no interface, no group, no thread.
 void fresh_engine();
-// Ends the threads, groups and sockets of the engine; whatever was allocated must be free again.
+// Ends the threads, groups, tunnels and sockets of the engine; whatever was allocated must be free again.
 void end_engine();
 // False when it takes more than three seconds: the kernel sees a link come and go some time after the fact.
 bool link_becomes(const char *interface, uint32_t status);
