@@ -16,132 +16,99 @@ using buffer_owner = owner<tbuffer, tb_free>;
 static std::string text(const tstring *string) {
     return string ? std::string(string->buffer, static_cast<size_t>(string->length)) : "(null)";
 }
-
-// ---- Sizes
+// What an operation leaves: the text, or the failure's number.
+static std::string left(lc_status status, const tstring *string) {
+    return status == LC_OK ? text(string) : std::to_string(status);
+}
+static uint32_t size_left(lc_status status, const tstring *string) {
+    return status == LC_OK ? string->size : static_cast<uint32_t>(status);
+}
+static uint32_t size_left(lc_status status, const tbuffer *buffer) {
+    return status == LC_OK ? tb_size(buffer) : static_cast<uint32_t>(status);
+}
 
 TEST(Strings, GrowByDoublingAndShrinkWhenLarge) {
+    const std::string many(1000, 'y');
     string_owner string;
     ASSERT_EQ(ts_new(&string), LC_OK);
-    EXPECT_EQ(string->size, 16u);
     for (int i = 0; i < 15; i++)
-        ASSERT_EQ(ts_append_char(string, 'x'), LC_OK);
-    EXPECT_EQ(string->size, 16u);
-    ASSERT_EQ(ts_append_char(string, 'x'), LC_OK);
-    EXPECT_EQ(string->size, 32u);
-    ASSERT_EQ(ts_append_str(string, std::string(84, 'y').c_str()), LC_OK);
-    EXPECT_EQ(string->size, 128u);
-    ASSERT_EQ(ts_clear_no_resize(string), LC_OK);
-    EXPECT_EQ(string->size, 128u);
+        EXPECT_EQ(size_left(ts_append_char(string, 'x'), string), 16u);
+    EXPECT_EQ(size_left(ts_append_char(string, 'x'), string), 32u);
+    EXPECT_EQ(size_left(ts_append_str(string, many.c_str() + 916), string), 128u);
+    EXPECT_EQ(size_left(ts_clear_no_resize(string), string), 128u);
     EXPECT_STREQ(ts_str(string), "");
-    ASSERT_EQ(ts_append_str(string, std::string(100, 'y').c_str()), LC_OK);
-    ASSERT_EQ(ts_clear(string), LC_OK);
-    EXPECT_EQ(string->size, 16u);
-
-    // A shrink stops at four times what is needed.
-    ASSERT_EQ(ts_append_str(string, std::string(1000, 'z').c_str()), LC_OK);
-    EXPECT_EQ(string->size, 1024u);
-    ASSERT_EQ(ts_copy_str(string, 20, "end"), LC_OK);
-    EXPECT_EQ(string->size, 64u);
-    EXPECT_EQ(text(string), std::string(20, 'z') + "end");
+    EXPECT_EQ(size_left(ts_append_str(string, many.c_str() + 900), string), 128u);
+    EXPECT_EQ(size_left(ts_clear(string), string), 16u);
+    EXPECT_EQ(size_left(ts_append_str(string, many.c_str()), string), 1024u);
+    EXPECT_EQ(size_left(ts_copy_str(string, 20, "end"), string), 64u); // stops at four times what is needed
+    EXPECT_EQ(text(string), std::string(20, 'y') + "end");
 }
 
 TEST(Strings, GrowInStepsAboveEightMegabytesAndRefuseTheLimit) {
     string_owner string;
-    ASSERT_EQ(ts_new_str(&string, std::string(0x1000000, 'a').c_str()), LC_OK);
-    EXPECT_EQ(string->size, 0x1000001u + 0x800000u);
     const std::string piece(0x1000000, 'b');
+    ASSERT_EQ(ts_new_str(&string, piece.c_str()), LC_OK);
+    EXPECT_EQ(string->size, 0x1000001u + 0x800000u);
     for (int i = 0; i < 3; i++)
         ASSERT_EQ(ts_append_str(string, piece.c_str()), LC_OK);
     log_lines log;
     EXPECT_EQ(ts_append_str(string, piece.c_str()), LC_ASSERTION); // would be 0x5000000 bytes
     EXPECT_NE(log.take().find("maximum size exceeded: 83886081"), std::string::npos);
     EXPECT_EQ(string->length, 0x4000000);
-    EXPECT_EQ(string->buffer[0x3ffffff], 'b');
-    ASSERT_EQ(ts_append_str(string, piece.c_str() + 1), LC_OK);
-    EXPECT_EQ(string->length, 0x4ffffff);
-    EXPECT_EQ(string->size, 0x5000000u);
+    EXPECT_EQ(size_left(ts_append_str(string, piece.c_str() + 1), string), 0x5000000u);
 }
 
-// ---- Writing at offsets
-
 TEST(Strings, OffsetsAndTheirLimits) {
-    string_owner string;
+    string_owner string, piece;
     ASSERT_EQ(ts_new_str(&string, "abcdef"), LC_OK);
-    EXPECT_EQ(ts_put_str(string, 2, "XY"), LC_OK);
-    EXPECT_EQ(text(string), "abXYef");
-    EXPECT_EQ(ts_put_str(string, 5, "12"), LC_OK);
-    EXPECT_EQ(text(string), "abXYe12");
-    EXPECT_EQ(ts_copy_str(string, 1, "c"), LC_OK);
-    EXPECT_EQ(text(string), "ac");
-    EXPECT_EQ(ts_put_char(string, 99, 'd'), LC_OK); // past the end appends
-    EXPECT_EQ(ts_put_char(string, 0, 'A'), LC_OK);
-    EXPECT_EQ(ts_insert_char(string, 1, 'b'), LC_OK);
-    EXPECT_EQ(text(string), "Abcd");
+    EXPECT_EQ(left(ts_put_str(string, 2, "XY"), string), "abXYef");
+    EXPECT_EQ(left(ts_put_str(string, 5, "12"), string), "abXYe12");
+    EXPECT_EQ(left(ts_copy_str(string, 1, "c"), string), "ac");
+    EXPECT_EQ(left(ts_put_char(string, 99, 'd'), string), "acd"); // past the end appends
+    EXPECT_EQ(left(ts_put_char(string, 0, 'A'), string), "Acd");
+    EXPECT_EQ(left(ts_insert_char(string, 1, 'b'), string), "Abcd");
     EXPECT_EQ(ts_insert_char(string, 5, 'x'), LC_NO_BUFFER_SPACE);
     EXPECT_EQ(ts_put_str(string, 5, "x"), LC_NO_BUFFER_SPACE);
     EXPECT_EQ(ts_copy_str(string, -1, "x"), LC_NO_BUFFER_SPACE);
-    EXPECT_EQ(ts_append_char(string, 0), LC_ASSERTION);
-    EXPECT_EQ(text(string), "Abcd");
-    EXPECT_EQ(ts_append(string, string), LC_OK); // itself
-    EXPECT_EQ(ts_append_str_frag(string, "0123456", 2, 3), LC_OK);
-    EXPECT_EQ(ts_append_str_frag(string, "0123456", 5, -1), LC_OK);
-    EXPECT_EQ(text(string), "AbcdAbcd23456");
     EXPECT_EQ(ts_append_str_frag(string, "012", 4, 1), LC_NO_BUFFER_SPACE);
-    EXPECT_EQ(ts_append_sprintf(string, "-%d", 7), LC_OK);
-    EXPECT_EQ(text(string), "AbcdAbcd23456-7");
-    EXPECT_EQ(ts_get_char(string, 14), static_cast<uint32_t>('7'));
+    EXPECT_EQ(ts_append_char(string, 0), LC_ASSERTION);
+    EXPECT_EQ(left(ts_append(string, string), string), "AbcdAbcd"); // itself
+    EXPECT_EQ(left(ts_append_str_frag(string, "0123456", 2, 3), string), "AbcdAbcd234");
+    EXPECT_EQ(left(ts_append_str_frag(string, "0123456", 5, -1), string), "AbcdAbcd23456");
+    EXPECT_EQ(left(ts_append_sprintf(string, "-%d", 7), string), "AbcdAbcd23456-7");
     EXPECT_EQ(ts_get_char(string, 15), 0u);
-
-    string_owner piece;
-    EXPECT_EQ(ts_substr(string, 4, 4, &piece), LC_OK);
-    EXPECT_EQ(text(piece), "Abcd");
-    EXPECT_EQ(ts_substr(string, 13, 99, &piece), LC_OK);
-    EXPECT_EQ(text(piece), "-7");
+    lc_status status = ts_substr(string, 4, 4, &piece);
+    EXPECT_EQ(left(status, piece), "Abcd");
+    status = ts_substr(string, 13, 99, &piece);
+    EXPECT_EQ(left(status, piece), "-7");
     EXPECT_EQ(ts_substr(string, 16, 1, &piece), LC_ASSERTION);
     int32_t at = 0;
-    EXPECT_EQ(ts_find_char(string, 1, 'A', &at), LC_OK);
-    EXPECT_EQ(at, 4);
-    EXPECT_EQ(ts_rfind_char(string, 3, 'A', &at), LC_OK);
-    EXPECT_EQ(at, 0);
-    EXPECT_EQ(ts_find_char(string, 0, '#', &at), LC_OK);
-    EXPECT_EQ(at, -1);
+    EXPECT_TRUE(ts_find_char(string, 1, 'A', &at) == LC_OK && at == 4);
+    EXPECT_TRUE(ts_rfind_char(string, 3, 'A', &at) == LC_OK && at == 0);
+    EXPECT_TRUE(ts_find_char(string, 0, '#', &at) == LC_OK && at == -1);
     ASSERT_EQ(ts_new_str(&piece, "  a b //"), LC_OK);
-    EXPECT_EQ(ts_trim(piece, ' ', '/'), LC_OK);
-    EXPECT_EQ(text(piece), "a b ");
+    EXPECT_EQ(left(ts_trim(piece, ' ', '/'), piece), "a b ");
 }
 
-TEST(Strings, NullsAndTakeover) {
-    string_owner string;
+TEST(Strings, NullsTakeoverAndOrder) {
+    string_owner string, other;
+    log_lines log;
+    EXPECT_EQ(ts_str(nullptr), nullptr);
+    EXPECT_NE(log.take().find("runtime_strings_test.cpp"), std::string::npos);
     EXPECT_EQ(ts_length(nullptr), -1);
-    EXPECT_EQ(ts_str_maybe(nullptr), nullptr);
     EXPECT_EQ(ts_append_str(nullptr, "x"), LC_NULL);
-    {
-        log_lines log;
-        EXPECT_EQ(ts_str(nullptr), nullptr);
-        const std::string lines = log.take();
-        EXPECT_NE(lines.find("Unexpected NULL"), std::string::npos);
-        EXPECT_NE(lines.find("runtime_strings_test.cpp"), std::string::npos);
-    }
-    EXPECT_EQ(ts_dup(nullptr, &string), LC_OK);
-    EXPECT_EQ(text(string), "");
     char *given = strdup("taken");
     EXPECT_EQ(ts_new_str_takeover(&string, &given, -1, -1), LC_OK);
     EXPECT_EQ(given, nullptr);
     EXPECT_EQ(ts_append_str(string, " and longer than it was"), LC_OK);
     EXPECT_EQ(ts_detach(&string.pointer, &given, nullptr), LC_OK);
     EXPECT_STREQ(given, "taken and longer than it was");
-    EXPECT_EQ(string.pointer, nullptr);
     free(given);
-
-    string_owner other;
-    EXPECT_TRUE(ts_equal(nullptr, nullptr));
     ASSERT_EQ(ts_new_str(&string, "Name"), LC_OK);
     ASSERT_EQ(ts_new_str(&other, "name"), LC_OK);
-    EXPECT_FALSE(ts_equal(string, nullptr));
-    EXPECT_FALSE(ts_equal(string, other));
+    EXPECT_TRUE(ts_equal(nullptr, nullptr) && !ts_equal(string, nullptr) && !ts_equal(string, other));
     EXPECT_LT(ts_cmp(string, other), 0);
-    EXPECT_TRUE(ts_equal_str(string, "nAME", 1));
-    EXPECT_FALSE(ts_equal_str(string, "nAME", 0));
+    EXPECT_TRUE(ts_equal_str(string, "nAME", 1) && !ts_equal_str(string, "nAME", 0));
 }
 
 TEST(Strings, CharactersOfUtf8) {
@@ -151,17 +118,14 @@ TEST(Strings, CharactersOfUtf8) {
     ASSERT_EQ(ts_set_utf8(string, 1), LC_OK);
     EXPECT_EQ(ts_num_chars(string), 3);
     EXPECT_EQ(ts_get_char(string, 1), 0xe4u);
-    EXPECT_EQ(ts_get_char(string, 2), static_cast<uint32_t>('z'));
     ASSERT_EQ(ts_substr(string, 1, 1, &piece), LC_OK);
     EXPECT_EQ(text(piece), "\xc3\xa4");
     EXPECT_TRUE(ts_equal_str(string, "A\xc3\x84Z", 1));
     int32_t at = 0;
-    EXPECT_EQ(ts_find_char(string, 0, 'z', &at), LC_OK);
-    EXPECT_EQ(at, 2);
-    EXPECT_EQ(ts_put_str(string, 1, "\xe2\x82\xac"), LC_OK); // one character for one
-    EXPECT_EQ(text(string), "a\xe2\x82\xacz");
-    EXPECT_EQ(ts_append_str_frag_utf8(string, "\xc3\xa4\xc3\xb6\xc3\xbc", 1, 1), LC_OK);
-    EXPECT_EQ(text(string), "a\xe2\x82\xacz\xc3\xb6");
+    EXPECT_TRUE(ts_find_char(string, 0, 'z', &at) == LC_OK && at == 2);
+    EXPECT_EQ(left(ts_put_str(string, 1, "\xe2\x82\xac"), string), "a\xe2\x82\xacz"); // one for one
+    EXPECT_EQ(left(ts_append_str_frag_utf8(string, "\xc3\xa4\xc3\xb6\xc3\xbc", 1, 1), string),
+              "a\xe2\x82\xacz\xc3\xb6");
     log_lines log;
     EXPECT_EQ(ts_append_str(string, "b\xff"), LC_BAD_UTF8);
     EXPECT_NE(log.take().find("98 *** 255 ***"), std::string::npos);
@@ -174,9 +138,7 @@ static std::string tokens(const char *given, char separator, char escape, char q
     tokens_owner array;
     if (ts_tokenize_str(given, separator, escape, quote, flags, &array) != LC_OK)
         return "(failed)";
-    if (!array.pointer)
-        return "(null)";
-    std::string all;
+    std::string all = array.pointer ? "" : "(null)";
     for (uint32_t i = 0; i < tstr_array_length_quick(array); i++)
         all += "[" + text(tstr_array_get_quick(array, i)) + "]";
     return all;
@@ -184,11 +146,9 @@ static std::string tokens(const char *given, char separator, char escape, char q
 static std::string joined(std::vector<const char *> parts, char separator, char escape, uint32_t flags) {
     tokens_owner array;
     string_owner string;
-    if (tstr_array_new(&array, nullptr) != LC_OK)
-        return "(failed)";
+    EXPECT_EQ(tstr_array_new(&array, nullptr), LC_OK);
     for (const char *part : parts)
-        if (tstr_array_append_str(array, part) != LC_OK)
-            return "(failed)";
+        EXPECT_EQ(tstr_array_append_str(array, part), LC_OK);
     return ts_join_tokens(array, separator, escape, 0, flags, &string) == LC_OK ? text(string) : "(failed)";
 }
 
@@ -219,12 +179,10 @@ TEST(Tokens, JoinAndComeBack) {
     EXPECT_EQ(joined({"a", "", "b"}, '/', 0, 0x600), "a/b/");
     EXPECT_EQ(joined({"a\\b", "c\\\\d"}, '/', '\\', 0), "a\\b/c\\\\\\d");
     EXPECT_EQ(joined({"a"}, 0, 0, 0x100), "(failed)");
-    EXPECT_EQ(joined({}, '/', '\\', 0x100), "/");
     // An escape at the end of a part must not swallow the separator behind it.
     for (const char *part : {"a\\", "\\\\", "\\/", "/", "x\\/\\"}) {
         const std::string name = joined({part, part, "end"}, '/', '\\', 0x100);
-        EXPECT_EQ(tokens(name.c_str(), '/', '\\', 0, 0x2c), std::string("[") + part + "][" + part + "][end]")
-            << name;
+        EXPECT_EQ(tokens(name.c_str(), '/', '\\', 0, 0x2c), std::string("[") + part + "][" + part + "][end]");
     }
 }
 
@@ -233,32 +191,22 @@ TEST(Tokens, JoinAndComeBack) {
 TEST(Buffers, SizesGrowAndShrink) {
     buffer_owner buffer;
     ASSERT_EQ(tb_new(&buffer), LC_OK);
-    EXPECT_EQ(tb_size(buffer), 128u);
-    const std::string bytes(127, 'x');
-    ASSERT_EQ(tb_append_buf(buffer, bytes.data(), 127), LC_OK);
-    EXPECT_EQ(tb_size(buffer), 128u);
-    ASSERT_EQ(tb_append_uint8(buffer, 'y'), LC_OK);
-    EXPECT_EQ(tb_size(buffer), 512u);
-    ASSERT_EQ(tb_ensure_size(buffer, 3000), LC_OK);
-    EXPECT_EQ(tb_size(buffer), 3072u); // a multiple of 128
-    ASSERT_EQ(tb_ensure_size(buffer, 12300), LC_OK);
-    EXPECT_EQ(tb_size(buffer), 16384u); // four times, then a multiple of 4096
-    ASSERT_EQ(tb_ensure_size(buffer, 0x1000000), LC_OK);
-    ASSERT_EQ(tb_ensure_size(buffer, 0x1000001), LC_OK);
-    EXPECT_EQ(tb_size(buffer), 0x1000001u + 0x800000u + 0xfffu);
+    EXPECT_EQ(size_left(tb_append_buf(buffer, std::string(127, 'x').data(), 127), buffer), 128u);
+    EXPECT_EQ(size_left(tb_append_uint8(buffer, 'y'), buffer), 512u);
+    EXPECT_EQ(size_left(tb_ensure_size(buffer, 3000), buffer), 3072u);   // a multiple of 128
+    EXPECT_EQ(size_left(tb_ensure_size(buffer, 12300), buffer), 16384u); // four times, in pages
+    EXPECT_EQ(size_left(tb_ensure_size(buffer, 0x1000000), buffer), 0x1000000u);
+    EXPECT_EQ(size_left(tb_ensure_size(buffer, 0x1000001), buffer), 0x1000001u + 0x800000u + 0xfffu);
     EXPECT_EQ(tb_ensure_size(buffer, 0x10000001), LC_ASSERTION);
+    EXPECT_EQ(size_left(tb_set_auto_shrink(buffer, 1), buffer), 256u);
     EXPECT_EQ(tb_length(buffer), 128);
-    ASSERT_EQ(tb_set_auto_shrink(buffer, 1), LC_OK);
-    EXPECT_EQ(tb_size(buffer), 256u);
     EXPECT_EQ(tb_buf(buffer)[127], 'y');
-    EXPECT_EQ(tb_length(nullptr), -1);
 }
 
 TEST(Buffers, GapsLengthsAndLimits) {
     buffer_owner buffer, constant;
     ASSERT_EQ(tb_new(&buffer), LC_OK);
     EXPECT_EQ(tb_put_buf(buffer, 10, "ab", 2), LC_OK);
-    EXPECT_EQ(tb_length(buffer), 12);
     EXPECT_EQ(std::string(reinterpret_cast<char *>(tb_buf(buffer)), 12), std::string(10, '\0') + "ab");
     EXPECT_EQ(tb_delete_bytes(buffer, 0, 10), LC_OK);
     EXPECT_STREQ(reinterpret_cast<char *>(tb_buf(buffer)), "ab");
@@ -267,52 +215,40 @@ TEST(Buffers, GapsLengthsAndLimits) {
     EXPECT_EQ(tb_set_length(buffer, 129), LC_GENERIC);
     EXPECT_EQ(tb_set_length(buffer, 128), LC_OK); // full to the brim, the NUL behind it
     EXPECT_EQ(tb_buf(buffer)[128], 0);
-    EXPECT_EQ(tb_avail(buffer), 0u);
     uint32_t number = 7;
-    EXPECT_EQ(tb_get_uint32(buffer, 124, &number), LC_OK);
-    EXPECT_EQ(number, 0u);
+    EXPECT_TRUE(tb_get_uint32(buffer, 124, &number) == LC_OK && number == 0);
     EXPECT_EQ(tb_get_uint32(buffer, 125, &number), LC_ASSERTION);
     EXPECT_EQ(tb_get_uint32(buffer, 0xfffffffe, &number), LC_ASSERTION);
-
     ASSERT_EQ(tb_new_buf_const(&constant, "fixed", 5), LC_OK);
     EXPECT_EQ(tb_append_uint8(constant, 1), LC_ASSERTION);
     EXPECT_EQ(tb_clear(constant), LC_ASSERTION);
-    uint8_t byte = 0;
-    EXPECT_EQ(tb_get_uint8(constant, 4, &byte), LC_OK);
-    EXPECT_EQ(byte, 'd');
 }
 
 TEST(Buffers, CountedStrings) {
     buffer_owner buffer;
     ASSERT_EQ(tb_new(&buffer), LC_OK);
-    uint32_t written = 0, used = 0;
+    uint32_t written = 0, used = 0, length = 0;
     EXPECT_EQ(tb_put_str(buffer, 0, 1, 1, 1, "abc", -1, &written), LC_OK);
     EXPECT_EQ(written, 8u);
     EXPECT_EQ(memcmp(tb_buf(buffer), "\0\0\0\4abc\0", 8), 0);
+    EXPECT_EQ(text_of([&](char **out) { return tb_get_str(buffer, 0, -1, 1, 1, 1, out, &length, &used); }),
+              "abc");
+    EXPECT_TRUE(length == 3 && used == 8);
     char *given = nullptr;
-    uint32_t length = 0;
-    EXPECT_EQ(tb_get_str(buffer, 0, -1, 1, 1, 1, &given, &length, &used), LC_OK);
-    EXPECT_STREQ(given, "abc");
-    EXPECT_EQ(length, 3u);
-    EXPECT_EQ(used, 8u);
-    free(given);
     EXPECT_EQ(tb_get_str(buffer, 0, -1, 0, 1, 0, &given, &length, &used), LC_NO_BUFFER_SPACE); // unswapped
     EXPECT_EQ(tb_get_str(buffer, 5, 4, 0, 0, 0, &given, &length, &used), LC_NO_BUFFER_SPACE);
 
     tokens_owner array, back;
-    ASSERT_EQ(tstr_array_new(&array, nullptr), LC_OK);
-    ASSERT_EQ(tstr_array_append_str(array, "one"), LC_OK);
-    ASSERT_EQ(tstr_array_append_str(array, ""), LC_OK);
+    ASSERT_EQ(ts_tokenize_str("one/", '/', 0, 0, ts_tok_keep_empty, &array), LC_OK);
     ASSERT_EQ(tb_clear(buffer), LC_OK);
     ASSERT_EQ(tb_append_tstr_array(buffer, 0, 1, array), LC_OK);
-    EXPECT_EQ(std::string(reinterpret_cast<char *>(tb_buf(buffer)), 15),
-              std::string("\0\0\0\2\0\0\0\3one\0\0\0\0", 15));
+    EXPECT_EQ(memcmp(tb_buf(buffer), "\0\0\0\2\0\0\0\3one\0\0\0\0", 15), 0);
     ASSERT_EQ(tb_get_tstr_array(buffer, 0, 0, 1, &back, &used), LC_OK);
     EXPECT_EQ(used, 15u);
-    EXPECT_EQ(tstr_array_length_quick(back), 2u);
-    ASSERT_EQ(tb_put_uint32(buffer, 0, 0xffffffff), LC_OK);
-    EXPECT_EQ(tb_get_tstr_array(buffer, 0, 0, 1, &back, &used), LC_NO_BUFFER_SPACE);
-    ASSERT_EQ(tb_put_uint32(buffer, 0, 0x03000000), LC_OK); // one string more than there is
-    EXPECT_NE(tb_get_tstr_array(buffer, 0, 0, 1, &back, &used), LC_OK);
-    EXPECT_EQ(back.pointer, nullptr);
+    EXPECT_TRUE(tstr_array_equal(array, back));
+    for (const uint32_t more : {0xffffffffu, 0x03000000u}) { // one string more than there is
+        ASSERT_EQ(tb_put_uint32(buffer, 0, more), LC_OK);
+        EXPECT_NE(tb_get_tstr_array(buffer, 0, 0, 1, &back, &used), LC_OK);
+        EXPECT_EQ(back.pointer, nullptr);
+    }
 }

@@ -7,7 +7,7 @@
 #include "tests/support/owners.h"
 
 struct Time : testing::Test {
-    void zone(const char *name) {
+    static void zone(const char *name) {
         setenv("TZ", name, 1);
         tzset();
     }
@@ -16,82 +16,58 @@ struct Time : testing::Test {
         tzset();
     }
 };
+#define TEXT(call) text_of([&](char **out) { return call; })
 
 TEST_F(Time, ToText) {
-    EXPECT_EQ(text_of([](char **out) { return lt_date_to_str(0, out); }), "1970/01/01");
-    EXPECT_EQ(text_of([](char **out) { return lt_date_to_str(4102444800u, out); }), "2100/01/01");
-    EXPECT_EQ(text_of([](char **out) { return lt_daytime_us_to_str(3661500000, out); }), "01:01:01.500");
-    EXPECT_EQ(text_of([](char **out) { return lt_daytime_us_to_str(3661000001, out); }), "01:01:01.000001");
-    EXPECT_EQ(text_of([](char **out) { return lt_daytime_ms_to_str(250, out); }), "00:00:00.250");
-    EXPECT_EQ(text_of([](char **out) { return lt_daytime_sec_to_str(43200, out); }), "12:00:00");
-    EXPECT_EQ(text_of([](char **out) { return lt_dur_us_to_str(1500000, out); }), "1.500000 seconds");
-    EXPECT_EQ(text_of([](char **out) { return lt_dur_sec_to_str(-2, out); }), "-2.000000 seconds");
+    EXPECT_EQ(TEXT(lt_date_to_str(0, out)), "1970/01/01");
+    EXPECT_EQ(TEXT(lt_daytime_us_to_str(3661500000, out)), "01:01:01.500");
+    EXPECT_EQ(TEXT(lt_daytime_us_to_str(3661000001, out)), "01:01:01.000001");
+    EXPECT_EQ(TEXT(lt_daytime_ms_to_str(250, out)), "00:00:00.250");
+    EXPECT_EQ(TEXT(lt_daytime_sec_to_str(43200, out)), "12:00:00");
+    EXPECT_EQ(TEXT(lt_dur_us_to_str(1500000, out)), "1.500000 seconds");
     zone("XYZ-2");
-    EXPECT_EQ(text_of([](char **out) { return lt_datetime_us_to_str(250125, 1, out); }),
-              "1970/01/01 02:00:00.250125 +0200");
-    EXPECT_EQ(text_of([](char **out) { return lt_datetime_sec_to_str(-1, 0, out); }), "1970/01/01 01:59:59");
-}
-
-TEST_F(Time, SmallBuffers) {
+    EXPECT_EQ(TEXT(lt_datetime_us_to_str(250125, 1, out)), "1970/01/01 02:00:00.250125 +0200");
+    EXPECT_EQ(TEXT(lt_datetime_sec_to_str(-1, 0, out)), "1970/01/01 01:59:59");
     char buffer[12];
     EXPECT_EQ(lt_daytime_us_to_buf(3661500000, 8, buffer), LC_ASSERTION);
     EXPECT_EQ(lt_daytime_us_to_buf(3661500000, 12, buffer), LC_OK); // no room for the fraction
     EXPECT_STREQ(buffer, "01:01:01");
     EXPECT_EQ(lt_dur_us_to_buf(1, 12, buffer), LC_ASSERTION);
-    EXPECT_EQ(lt_date_to_buf(0, 12, nullptr, nullptr), LC_NULL);
-    uint32_t length = 0;
-    EXPECT_EQ(lt_date_to_buf(0, 11, buffer, &length), LC_OK);
-    EXPECT_EQ(length, 10u);
 }
 
 TEST_F(Time, FromText) {
     int64_t us = 0, more = 0;
     int32_t seconds = 0;
     lt_date date = 0;
-    EXPECT_EQ(lt_str_to_daytime_us("01:01", &us), LC_OK);
-    EXPECT_EQ(us, 3660000000);
-    EXPECT_EQ(lt_str_to_daytime_sec("12:00:00", &seconds), LC_OK);
-    EXPECT_EQ(seconds, 43200);
-    EXPECT_EQ(lt_str_to_date("2020/1/2", &date), LC_OK);
-    EXPECT_EQ(date, 1577923200u);
+    EXPECT_TRUE(lt_str_to_daytime_us("01:01", &us) == LC_OK && us == 3660000000);
+    EXPECT_TRUE(lt_str_to_daytime_sec("12:00:00", &seconds) == LC_OK && seconds == 43200);
+    EXPECT_TRUE(lt_str_to_date("2020/1/2", &date) == LC_OK && date == 1577923200);
     EXPECT_EQ(lt_str_to_datetime_us("2020/01/02 03:04:05", &us), LC_OK);
-    EXPECT_EQ(lt_str_to_datetime_us("2020/01/02 03:04:05.5", &more), LC_OK);
-    EXPECT_EQ(more - us, 500000);
-    EXPECT_EQ(lt_str_to_dur_us("1.5", &us), LC_OK);
-    EXPECT_EQ(us, 1500000);
-    EXPECT_EQ(lt_str_to_dur_us("-1.5 seconds", &us), LC_OK);
-    EXPECT_EQ(us, -1500000);
+    EXPECT_TRUE(lt_str_to_datetime_us("2020/01/02 03:04:05.5", &more) == LC_OK && more - us == 500000);
+    EXPECT_TRUE(lt_str_to_dur_us("-1.5 seconds", &us) == LC_OK && us == -1500000);
     EXPECT_EQ(lt_str_to_dur_ms("-1", &us), LC_ASSERTION);
     EXPECT_EQ(lt_str_to_dur_sec("2147483647", &seconds), LC_OK);
     EXPECT_EQ(lt_str_to_dur_sec("2147483648", &seconds), LC_ASSERTION);
-    EXPECT_EQ(lt_str_to_dur_us("nan", &us), LC_BAD_TYPE);
-    EXPECT_EQ(lt_str_to_dur_us("1e300", &us), LC_BAD_TYPE);
-
+    for (const char *bad : {"nan", "1e300"})
+        EXPECT_EQ(lt_str_to_dur_us(bad, &us), LC_BAD_TYPE) << bad;
     for (const char *bad : {"2020/1/2x", "2020", "", "x"})
         EXPECT_EQ(lt_str_to_date(bad, &date), LC_BAD_TYPE) << bad;
     for (const char *bad : {"25:00", "1:2:3 x", "1:2:3.x", "1:2:3.5e3", "", "01"})
         EXPECT_EQ(lt_str_to_daytime_us(bad, &us), LC_BAD_TYPE) << bad;
-    EXPECT_EQ(lt_str_to_date(nullptr, &date), LC_NULL);
-    EXPECT_EQ(lt_str_to_date("2020/1/2", nullptr), LC_NULL);
 }
 
 // What was written reads back, to the microsecond.
 TEST_F(Time, ComesBack) {
     zone("CET-1CEST,M3.5.0,M10.5.0/3");
+    int64_t back = 0;
     for (int64_t us = 1; us < 2000000000000000; us = us * 7 + 3) {
-        int64_t back = 0;
-        const std::string text = text_of([&](char **out) { return lt_datetime_us_to_str(us, 0, out); });
-        EXPECT_EQ(lt_str_to_datetime_us(text.c_str(), &back), LC_OK) << text;
-        EXPECT_EQ(back, us) << text;
+        const std::string text = TEXT(lt_datetime_us_to_str(us, 0, out));
+        EXPECT_TRUE(lt_str_to_datetime_us(text.c_str(), &back) == LC_OK && back == us) << text;
     }
     for (int64_t us = 1; us < 86400000000; us = us * 3 + 29) {
-        int64_t back = 0;
-        const std::string day = text_of([&](char **out) { return lt_daytime_us_to_str(us, out); });
-        EXPECT_EQ(lt_str_to_daytime_us(day.c_str(), &back), LC_OK) << day;
-        EXPECT_EQ(back, us) << day;
-        const std::string span = text_of([&](char **out) { return lt_dur_us_to_str(us, out); });
-        EXPECT_EQ(lt_str_to_dur_us(span.c_str(), &back), LC_OK) << span;
-        EXPECT_EQ(back, us) << span;
+        const std::string day = TEXT(lt_daytime_us_to_str(us, out)), span = TEXT(lt_dur_us_to_str(us, out));
+        EXPECT_TRUE(lt_str_to_daytime_us(day.c_str(), &back) == LC_OK && back == us) << day;
+        EXPECT_TRUE(lt_str_to_dur_us(span.c_str(), &back) == LC_OK && back == us) << span;
     }
 }
 
@@ -104,6 +80,4 @@ TEST_F(Time, ZoneIsReadAgain) {
     ASSERT_EQ(lt_timezone_handle_changed(), LC_OK);
     EXPECT_EQ(getenv("TZ"), nullptr);
     EXPECT_STRNE(tzname[0], "ABC");
-    EXPECT_EQ(lt_tm_to_time_us(nullptr), 0);
-    EXPECT_EQ(lt_tm_utc_to_time_sec(nullptr), 0);
 }
