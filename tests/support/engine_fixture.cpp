@@ -71,7 +71,7 @@ int threads_named(const std::string &name) {
         for (const auto &entry : std::filesystem::directory_iterator("/proc/self/task")) {
             std::ifstream file(entry.path() / "comm");
             std::string line;
-            count += std::getline(file, line) && line == name;
+            count += std::getline(file, line) && line.rfind(name, 0) == 0;
         }
     return count;
 }

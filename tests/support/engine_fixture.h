@@ -19,7 +19,7 @@ void fresh_engine();
 void end_engine();
 // False when it takes more than three seconds: the kernel sees a link come and go some time after the fact.
 bool link_becomes(const char *interface, uint32_t status);
-// How many threads of this process have that name; a thread names itself when it first runs.
+// How many threads of this process have a name that begins so; a thread names itself when it first runs.
 int threads_named(const std::string &name);
 
 // A packet as a receive thread hands it on. Under the address sanitizer nothing behind `length` can be
