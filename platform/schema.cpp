@@ -330,3 +330,13 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
     }
     return true;
 }
+
+// --- Reports
+
+const char *alarm_name(const std::string &type) {
+    return type == "196638" ? "adjacency" : type == "196639" ? "assignment" : "unknown";
+}
+
+const char *role_name(const std::string &role) {
+    return role == "0" ? "ACTIVE" : role == "1" ? "BACKUP" : "UNKNOWN";
+}

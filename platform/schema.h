@@ -44,3 +44,6 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
                  std::string *out_reason);
 // Text of one type into the form that the type's own conversion gives.
 bool canonical_text(uint32_t type, const std::string &text, std::string *out_text);
+// The words for the numbers in wccpd's reports.
+const char *alarm_name(const std::string &type);
+const char *role_name(const std::string &role);

@@ -14,11 +14,14 @@ enum ctl_exit : int {
     CTL_UNREACHABLE = 3, // no mgmtd, no answer, or the session was lost
     CTL_NOT_FOUND = 4,   // no such node or group
     CTL_PARTLY = 5,      // a change of several commits stopped in between; what is left undone is told
+    CTL_STANDING = 6,    // alarms --check: an alarm stands
+    CTL_OUTPUT = 7,      // standard output took not all of it
 };
 
 struct ctl_options {
     bool json = false;
     bool watch = false;
+    bool secrets = false; // passwords are shown
     int colour = -1; // 1 yes, 0 no, -1 when standard output is a terminal
     int64_t timeout_ms = 10'000;
 };

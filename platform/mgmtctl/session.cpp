@@ -4,8 +4,8 @@
 // One thread. Every wait is a row of rounds, each of which polls what the list holds and calls its functions;
 // these read frames and end in the callbacks here, which turn an answer or an event into text at once, so
 // that nothing of the library is kept. A wait ends with what it waits for, with the loss of the session, at
-// its deadline, or when a signal has asked the program to end (ctl_stop_signal). The signals of that kind are
-// blocked but inside the poll (ppoll), so that none is missed between a look and the wait.
+// its deadline, or when a signal has asked the program to end (ctl_stop_signal). These signals are blocked
+// from the look at it on until the poll opens them (ppoll), so that none is missed in between.
 //
 // The library logs what fails. For a person at a terminal these lines are noise beside the reason that is
 // given here, so the log is suspended for as long as the process lives.
@@ -89,10 +89,25 @@ static void call_ready(const fdic_event_array *events, const std::vector<pollfd>
     }
 }
 
+struct blocked_signals {
+    sigset_t before;
+    blocked_signals() {
+        sigset_t stop;
+        sigemptyset(&stop);
+        for (const int number : {SIGINT, SIGTERM, SIGHUP})
+            sigaddset(&stop, number);
+        sigprocmask(SIG_BLOCK, &stop, &before);
+    }
+    ~blocked_signals() { sigprocmask(SIG_SETMASK, &before, nullptr); }
+    blocked_signals(const blocked_signals &) = delete;
+    blocked_signals &operator=(const blocked_signals &) = delete;
+};
+
 enum class round { ran, over, interrupted };
 
 // One poll until `deadline` (-1: no limit), and what is ready called.
 static round run_round(ctl_session *self, int64_t deadline) {
+    const blocked_signals blocked;
     if (ctl_stop_signal)
         return round::interrupted;
     owned<fdic_event_array, fdic_event_array_release> events;
@@ -107,9 +122,7 @@ static round run_round(ctl_session *self, int64_t deadline) {
     }
     const int64_t left = deadline < 0 ? 0 : std::max<int64_t>(deadline - now_ms(), 0);
     const timespec limit = {static_cast<time_t>(left / 1000), static_cast<long>(left % 1000 * 1000000)};
-    sigset_t open;
-    sigemptyset(&open);
-    const int ready = ppoll(polled.data(), polled.size(), deadline < 0 ? nullptr : &limit, &open);
+    const int ready = ppoll(polled.data(), polled.size(), deadline < 0 ? nullptr : &limit, &blocked.before);
     if (ready < 0)
         return errno == EINTR ? round::interrupted : round::over;
     if (ready == 0)

@@ -34,7 +34,7 @@ struct ctl_change_item {
 };
 
 // Set by the program's handlers of SIGINT, SIGTERM and SIGHUP, 0 until then. Once it is set no wait goes on,
-// and a request fails with "interrupted". These signals are best blocked: a wait opens them.
+// and a request fails with "interrupted".
 extern volatile std::sig_atomic_t ctl_stop_signal;
 
 struct ctl_session; // owned by whoever opened it

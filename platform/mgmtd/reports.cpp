@@ -28,14 +28,6 @@ static node_value time_now() {
     return {bn_type_datetime_sec, text.pointer};
 }
 
-static const char *alarm_name(const std::string &type) {
-    return type == "196638" ? "adjacency" : type == "196639" ? "assignment" : "unknown";
-}
-
-static const char *role_name(const std::string &role) {
-    return role == "0" ? "ACTIVE" : role == "1" ? "BACKUP" : "UNKNOWN";
-}
-
 static void remove_report(server *self, const node_name &root) {
     self->alarm_owners.erase(root);
     self->state.erase(root);
