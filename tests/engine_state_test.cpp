@@ -2,6 +2,8 @@
 // the engine's ticks turned by hand; and the state with its role.
 #include "engine/wccp_state.h"
 
+#include <map>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -102,67 +104,52 @@ TEST_F(StateTest, TheLowestAddressAsANumberIsDesignated) {
     }
 }
 
-TEST_F(StateTest, EveryReportedRouterMustBeTwoWay) {
-    see(ROUTER_A, {ROUTER_A, ROUTER_B}, {{US, 100}}); // B is not heard
-    pass_seconds(1);
-    EXPECT_EQ(group->designated, 0u);
-    see(ROUTER_B, {ROUTER_A, ROUTER_B}, {}); // B doesn't list us
-    pass_seconds(1);
-    EXPECT_EQ(group->designated, 0u);
-    EXPECT_FALSE(group->state_flags & WCCP_DESG_ELECT_PENDING); // no timer tries again
-    see(ROUTER_B, {ROUTER_A, ROUTER_B}, {{US, 100}});
-    pass_seconds(1);
-    EXPECT_EQ(group->designated, 1u);
-    EXPECT_EQ(group->pending_acks, 2);
-    see(ROUTER_C, {}, {}); // no change of any view
-    pass_seconds(1);
-    EXPECT_EQ(group->designated, 1u);
-    // All that a router listed is gone: nobody to be designated for.
-    see(ROUTER_A, {}, {});
-    see(ROUTER_B, {}, {});
-    pass_seconds(1);
-    EXPECT_EQ(group->designated, 0u);
-}
-
-TEST_F(StateTest, TheKeyCountsOnUntilTheElectionIsLost) {
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(3), 100}, {host(4), 100}});
-    pass_seconds(1);
-    EXPECT_EQ(group->dsg_key_change, 1u);
-    router(ROUTER_A)->assign_tx_count = 2;
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(4), 100}}); // 3 is down for one computation
-    pass_seconds(1);
-    EXPECT_EQ(group->dsg_key_change, 2u);
-    EXPECT_EQ(group->dsg_appliances[0].assigned + group->dsg_appliances[1].assigned, 256);
-    EXPECT_NE(group->dsg_appliances[0].assigned, 128);
-    EXPECT_EQ(router(ROUTER_A)->assign_tx_count, 0u);
-    EXPECT_TRUE(router(ROUTER_A)->flags & WCCP_RTR_ASSIGN_UNACKED);
-
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(0), 100}});
-    pass_seconds(1);
-    EXPECT_EQ(group->designated, 0u);
-    EXPECT_EQ(group->pending_acks, 0);
-    EXPECT_EQ(group->assign_timer.active, 0);
-    EXPECT_FALSE(router(ROUTER_A)->flags & WCCP_RTR_ASSIGN_UNACKED);
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}});
-    pass_seconds(1);
-    EXPECT_EQ(group->dsg_key_change, 1u);
-}
-
-TEST_F(StateTest, WithNobodyEligibleThereIsNoTable) {
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}});
-    see(ROUTER_B, {}, {{host(2), 100}}); // reported by one router each
-    pass_seconds(1);
-    EXPECT_EQ(group->designated, 1u);
-    EXPECT_EQ(group->dsg_key_change, 0u);
-    EXPECT_EQ(group->bucket_count, 0u);
-    EXPECT_EQ(group->assign_timer.active, 0);
-    EXPECT_EQ(wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_WEIGHT_CHANGE), 1);
-    group->designated = 0;
+TEST_F(StateTest, ElectionsFollowTheViews) {
+    const be32 A = ROUTER_A, B = ROUTER_B, C = ROUTER_C;
+    const struct {
+        be32 from;
+        std::vector<be32> routers;
+        std::vector<uint32_t> appliances; // 10.0.0.x, of weight 100
+        const char *elected;              // key, acknowledgements due, slots of each active appliance
+    } steps[] = {
+        {A, {A, B}, {1}, "no"}, // B is not heard
+        {B, {A, B}, {}, "no"},  // B doesn't list us
+        {B, {A, B}, {1, 2}, "1 2 1:256"},
+        {C, {}, {}, "1 2 1:256"},   // no change of any view
+        {B, {A, B}, {1, 3}, "1 0"}, // nobody is reported by all of them
+        {C, {}, {0, 1}, "no"},      // a lower one
+        {C, {}, {1}, "1 3 1:256"},  // the key counts from the start
+        {A, {A, B}, {1, 3}, "2 3 1:256"},
+        {B, {A, B}, {3, 1, 4}, "3 3 1:256"},
+        {A, {A, B}, {4, 3, 1}, "4 3 1:256"},
+        {C, {}, {1, 4, 3}, "5 3 1:85 3:85 4:86"},
+        {C, {}, {1, 4}, "6 3 1:127 4:129"}, // 3 is down for one computation
+        {A, {}, {}, "no"},
+    };
+    for (const auto &step : steps) {
+        SCOPED_TRACE(&step - steps);
+        reported_appliances appliances;
+        for (const uint32_t each : step.appliances)
+            appliances.push_back({host(each), 100});
+        see(step.from, step.routers, appliances);
+        const bool election = (group->state_flags & WCCP_DESG_ELECT_PENDING) != 0;
+        router(A)->assign_tx_count = 2;
+        pass_seconds(1);
+        EXPECT_FALSE(group->state_flags & WCCP_DESG_ELECT_PENDING); // no timer tries again
+        EXPECT_EQ(router(A)->assign_tx_count, election ? 0u : 2u);
+        EXPECT_EQ((router(A)->flags & WCCP_RTR_ASSIGN_UNACKED) != 0, group->pending_acks != 0);
+        EXPECT_EQ(group->assign_timer.active, group->pending_acks != 0);
+        std::map<uint32_t, uint32_t> shares;
+        for (uint32_t i = 0; i < group->dsg_active_count; i++)
+            shares[group->dsg_appliances[i].ipa.bytes[3]] = group->dsg_appliances[i].assigned;
+        std::string elected =
+            std::to_string(group->dsg_key_change) + " " + std::to_string(group->pending_acks);
+        for (const auto &[octet, assigned] : shares)
+            elected += " " + std::to_string(octet) + ":" + std::to_string(assigned);
+        EXPECT_EQ(group->designated ? elected : "no", step.elected);
+    }
     EXPECT_EQ(wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_WEIGHT_CHANGE), 0);
-    see(ROUTER_B, {}, {{US, 100}});
-    pass_seconds(1);
-    EXPECT_EQ(group->dsg_key_change, 1u);
-    EXPECT_EQ(group->dsg_active_count, 1u);
+    EXPECT_EQ(group->assign_timer.active, 0);
 }
 
 TEST_F(StateTest, ASilentRouterGoesAfter40To44Seconds) {
@@ -262,96 +249,94 @@ TEST_F(StateTest, ALaterReasonLeavesTheCheckWhereItIs) {
     EXPECT_EQ(group->router_alarm_timer.active + group->assign_alarm_timer.active, 0);
 }
 
-// The two checks on a group in which no alarm stands: whether all is in order.
-bool connected(wccp_service_group *group) {
-    group->raised_alarms = 0;
-    wccp_alarm_verify_router_connectivity(group);
-    return group->raised_alarms == 0;
-}
-bool carried_out(wccp_service_group *group) {
-    group->raised_alarms = 0;
-    wccp_alarms_verify_allocation_table(group);
-    return group->raised_alarms != WCCP_ALARM_ASSIGNMENT;
+// The two checks: what the log says behind "alarm: ", and whether an event went, which fails without a
+// session.
+struct CheckTest : StateTest {
+    std::string said(int (*check)(wccp_service_group *)) {
+        log.take();
+        EXPECT_EQ(check(group), 0);
+        std::istringstream lines(log.take());
+        std::string told;
+        for (std::string line; std::getline(lines, line);) {
+            const size_t at = line.find("WCCP GRP 51: alarm: ");
+            told += at != std::string::npos                       ? line.substr(at + 20) + "\n"
+                    : line.ends_with("Error code 14001 returned") ? "event\n"
+                                                                  : "";
+        }
+        return told;
+    }
+    std::string connectivity() { return said(wccp_alarm_verify_router_connectivity); }
+    std::string allocation() { return said(wccp_alarms_verify_allocation_table); }
+    log_lines log;
+};
+
+TEST_F(CheckTest, ConnectivityIsHealthyWithEnoughTwoWayAndNoneOneWay) {
+    const std::string begin = "verify router connectivity.\n",
+                      raise = "raising adjacency down alarm\nevent\n",
+                      clear = "clearing adjacency down alarm\nevent\n";
+    EXPECT_EQ(connectivity(), begin + "router verification is ok. configured: 0 one-way: 0 two-way: 0\n");
+    group->ucast_router_count = 2;
+    EXPECT_EQ(connectivity(), begin +
+                                  "raising router down alarm. routers configured: 2 connections one-way: 0 "
+                                  "two-way: 0\n" +
+                                  raise);
+    see(ROUTER_A, {}, {{US, 1}});
+    EXPECT_EQ(connectivity(), begin); // it stands already
+    group->mcast_configured = 1;      // then one is enough
+    EXPECT_EQ(connectivity(),
+              begin + "clearing router down alarm: routers one-way: 0 two-way: 1 configured: 1.\n" + clear);
+    see(ROUTER_B, {}, {{US, 1}});
+    EXPECT_EQ(connectivity(), begin + "router verification is ok. configured: 1 one-way: 0 two-way: 2\n");
+    router(ROUTER_C);
+    EXPECT_EQ(connectivity(), begin +
+                                  "raising router down alarm. routers configured: 1 connections one-way: 1 "
+                                  "two-way: 2\n" +
+                                  raise);
 }
 
-TEST_F(StateTest, ConnectivityIsHealthyWithEnoughTwoWayAndNoneOneWay) {
-    EXPECT_TRUE(connected(group)); // nothing expected, nothing there
-    group->mcast_configured = 1;
-    group->ucast_router_count = 5;
-    EXPECT_FALSE(connected(group));
-    see(ROUTER_A, {}, {{US, 100}});
-    EXPECT_TRUE(connected(group));
-    see(ROUTER_B, {}, {{US, 100}});
-    EXPECT_TRUE(connected(group));
-    see(ROUTER_C, {}, {});
-    EXPECT_FALSE(connected(group));
-}
+TEST_F(CheckTest, TheAssignmentIsComparedOrSearchedForHoles) {
+    const std::string begin = "verify assignment table.\n", other = begin + "verify by non-designator.\n",
+                      raise = "raising assignment table mismatch alarm\nevent\n",
+                      clear = "clearing assignment table alarm\nevent\n",
+                      nobody = "router 10.0.0.201 is not redirecting to ANY appliance.\n";
+    group->raised_alarms = WCCP_ALARM_ASSIGNMENT;
+    EXPECT_EQ(allocation(), other + clear); // no routers
+    see(ROUTER_A, {}, {});
+    EXPECT_EQ(allocation(), other + nobody + raise);
+    see(ROUTER_A, {}, {{US, 0}});
+    EXPECT_EQ(allocation(), other + nobody); // in order, but for nobody
+    see(ROUTER_A, {}, {{US, 0}, {host(2), 7}});
+    EXPECT_EQ(allocation(),
+              other + "router 10.0.0.201 is not redirecting to appliance (10.0.0.2 weight 7)\n");
+    router(ROUTER_A)->view_appliances[1].buckets_assigned = 1;
+    EXPECT_EQ(allocation(), other + clear);
 
-TEST_F(StateTest, TheDesignatedComparesWhatItAskedFor) {
     for (const be32 id : {ROUTER_A, ROUTER_B})
         see(id, {id}, {{US, 100}, {host(2), 100}, {host(3), 0}});
     pass_seconds(1);
     ASSERT_EQ(group->designated, 1u);
-    EXPECT_FALSE(carried_out(group));
+    const auto compared = [](const std::string &appliance, const std::string &router, uint32_t buckets) {
+        return "allocation. appliance 10.0.0." + appliance + " buckets dsg: 128 router 10.0.0." + router +
+               " " + std::to_string(buckets) + "\n";
+    };
+    const auto mismatch = [&](const char *appliance, const char *router, uint32_t buckets) {
+        const std::string look = compared(appliance, router, buckets);
+        return "verify " + look + std::string(look).replace(10, 0, " mismatch");
+    };
+    const std::string first = begin + "verify " + compared("2", "202", 128) + "verify " +
+                              compared("2", "201", 128) + "verify " + compared("1", "202", 128);
+    EXPECT_EQ(allocation(), begin + mismatch("2", "202", 0) + raise);
     for (const be32 id : {ROUTER_A, ROUTER_B})
         for (uint32_t i = 0; i < 2; i++)
             router(id)->view_appliances[i].buckets_assigned = 128;
-    EXPECT_TRUE(carried_out(group));
-    router(ROUTER_B)->view_appliances[0].buckets_assigned = 127;
-    EXPECT_FALSE(carried_out(group));
-    router(ROUTER_B)->view_appliances[0].buckets_assigned = 128;
-    router(ROUTER_B)->view_appliances[2].weight = 1; // and no buckets
-    EXPECT_FALSE(carried_out(group));
-}
-
-TEST_F(StateTest, AnyOtherLooksForHoles) {
-    EXPECT_TRUE(carried_out(group)); // no routers at all
-    see(ROUTER_A, {}, {});
-    EXPECT_FALSE(carried_out(group));
-    see(ROUTER_A, {}, {{host(1), 0}});
-    EXPECT_FALSE(carried_out(group)); // in order, but nobody gets anything
-    see(ROUTER_A, {}, {{host(1), 0}, {host(2), 10}});
-    EXPECT_FALSE(carried_out(group));
-    router(ROUTER_A)->view_appliances[1].buckets_assigned = 1;
-    EXPECT_TRUE(carried_out(group));
-}
-
-TEST_F(StateTest, AlarmsAreToldInTheLogAndFailWithoutASession) {
-    log_lines log;
-    const auto tells = [&log](int (*check)(wccp_service_group *), wccp_service_group *of,
-                              const std::vector<std::string> &wanted) {
-        log.take();
-        check(of);
-        const std::string lines = log.take();
-        size_t from = 0;
-        for (const std::string &line : wanted) {
-            from = lines.find("WCCP GRP 51: alarm: " + line, from);
-            ASSERT_NE(from, std::string::npos) << line << "\n-- among --\n" << lines;
-        }
-        EXPECT_EQ(lines.find("Error code 14001 returned") != std::string::npos, wanted.size() > 2) << lines;
-    };
-    group->ucast_router_count = 2;
-    see(ROUTER_A, {ROUTER_A}, {{US, 100}, {host(2), 7}});
-    tells(wccp_alarm_verify_router_connectivity, group,
-          {"verify router connectivity.",
-           "raising router down alarm. routers configured: 2 connections one-way: 0 two-way: 1",
-           "raising adjacency down alarm"});
-    group->ucast_router_count = 1;
-    tells(wccp_alarm_verify_router_connectivity, group,
-          {"verify router connectivity.",
-           "clearing router down alarm: routers one-way: 0 two-way: 1 configured: 1.",
-           "clearing adjacency down alarm"});
-    tells(wccp_alarm_verify_router_connectivity, group,
-          {"verify router connectivity.", "router verification is ok. configured: 1 one-way: 0 two-way: 1"});
-    router(ROUTER_A)->view_appliances[0].buckets_assigned = 9;
-    tells(wccp_alarms_verify_allocation_table, group,
-          {"verify assignment table.", "verify by non-designator.",
-           "router 10.0.0.201 is not redirecting to appliance (10.0.0.2 weight 7)",
-           "raising assignment table mismatch alarm"});
-    pass_seconds(1); // designated by now
-    tells(wccp_alarms_verify_allocation_table, group,
-          {"verify allocation. appliance 10.0.0.", "allocation mismatch. appliance 10.0.0."});
-    EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ASSIGNMENT);
+    EXPECT_EQ(allocation(), first + "verify " + compared("1", "201", 128) + clear);
+    router(ROUTER_A)->view_appliances[0].buckets_assigned = 127;
+    EXPECT_EQ(allocation(), first + mismatch("1", "201", 127) + raise);
+    router(ROUTER_A)->view_appliances[0].buckets_assigned = 128;
+    router(ROUTER_A)->view_appliances[2].weight = 1; // and no buckets
+    EXPECT_EQ(allocation(),
+              first + "verify " + compared("1", "201", 128) +
+                  "allocation mismatch. appliance 10.0.0.3 weight : 1 router 10.0.0.201 buckets : 0\n");
 }
 
 } // namespace

@@ -3,7 +3,7 @@
 #include "engine/wccp_view_utils.h"
 
 #include <bit>
-#include <map>
+#include <sstream>
 #include <string>
 #include <utility>
 #include <vector>
@@ -19,91 +19,101 @@
 
 namespace {
 
-using appliances = reported_appliances;
-using counts = std::map<std::string, int>; // mentions of an address
-
 struct ViewTest : testing::Test, all_freed, reported_group {
     ViewTest() : reported_group(false) {}
-    template <typename Entry>
-    static counts mentions(const Entry *entry) {
-        counts found;
-        for (; entry; entry = entry->next)
-            found[addr_text(entry->ipa).s] += entry->ref_count;
-        return found;
-    }
-    std::vector<uint16_t> weights_in_order() {
-        std::vector<uint16_t> found;
-        for (const wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next)
-            found.push_back(entry->weight);
-        return found;
-    }
-    // Whether the views have changed since the last call, as the group notes it.
-    uint32_t changes() {
+    // The union, in list order: routers with their mentions, appliances with weight and mentions; behind it
+    // by how much the change number has risen since the last call.
+    std::string views() {
+        std::ostringstream text;
+        const auto name = [](be32 ipa) { return std::string(addr_text(ipa).s).substr(5); };
+        uint32_t routers = 0, appliances = 0;
+        for (const wccp_view_router *entry = group->router_view; entry; entry = entry->next, routers++)
+            text << name(entry->ipa) << ":" << entry->ref_count << " ";
+        text << "|";
+        for (const wccp_view_appliance *entry = group->appliance_view; entry;
+             entry = entry->next, appliances++)
+            text << " " << name(entry->ipa) << "/" << entry->weight << ":" << entry->ref_count;
+        EXPECT_EQ(group->router_view_count, routers);
+        EXPECT_EQ(group->appliance_view_count, appliances);
         const uint32_t risen = group->change_number - seen_change_number;
         EXPECT_EQ((group->state_flags & WCCP_DESG_ELECT_PENDING) != 0, risen != 0);
         group->state_flags &= ~WCCP_DESG_ELECT_PENDING;
         seen_change_number = group->change_number;
-        return risen;
+        text << " +" << risen;
+        return text.str();
     }
     uint32_t seen_change_number = 0;
 };
 
-TEST_F(ViewTest, OnlyTheHeadIsComparedInASortedInsertion) {
-    report(ROUTER_A, {{host(10), 100}, {host(11), 50}, {host(12), 75}, {host(13), 60}});
-    EXPECT_EQ(weights_in_order(), (std::vector<uint16_t>{100, 60, 75, 50}));
-    report(ROUTER_A, {});
-    report(ROUTER_A, {{host(10), 50}, {host(11), 60}, {host(12), 55}, {host(13), 70}});
-    EXPECT_EQ(weights_in_order(), (std::vector<uint16_t>{70, 60, 55, 50}));
+TEST_F(ViewTest, ReportsMoveTheUnion) {
+    const be32 A = ROUTER_A, B = ROUTER_B;
+    const be32 low = to_be32(0x0a000002), high = to_be32(0x0a000101);
+    const struct {
+        be32 from;
+        std::vector<be32> routers;
+        reported_appliances appliances;
+        const char *views;
+    } steps[] = {
+        // Only the head is compared in a sorted insertion.
+        {A,
+         {},
+         {{host(10), 100}, {host(11), 50}, {host(12), 75}, {host(13), 60}},
+         "| 0.10/100:1 0.13/60:1 0.12/75:1 0.11/50:1 +1"},
+        {A, {}, {}, "| +1"},
+        {A,
+         {},
+         {{host(10), 50}, {host(11), 60}, {host(12), 55}, {host(13), 70}},
+         "| 0.13/70:1 0.11/60:1 0.12/55:1 0.10/50:1 +1"},
+        // Of equal weights the higher address, as a number, goes first.
+        {A, {}, {{low, 9}, {high, 9}}, "| 1.1/9:1 0.2/9:1 +1"},
+        {A, {}, {}, "| +1"},
+        {A, {}, {{high, 9}, {low, 9}}, "| 1.1/9:1 0.2/9:1 +1"},
+        // Mentions are counted, and an entry goes with the last.
+        {A, {A, B}, {{US, 100}, {low, 9}}, "0.202:1 0.201:1 | 0.1/100:1 0.2/9:1 +2"},
+        {B, {B}, {{low, 9}}, "0.202:2 0.201:1 | 0.1/100:1 0.2/9:2 +2"},
+        {A, {A, B}, {{US, 100}}, "0.202:2 0.201:1 | 0.1/100:1 0.2/9:1 +1"},
+        {B, {}, {}, "0.202:1 0.201:1 | 0.1/100:1 +2"},
+        // An address that a report names twice keeps union and arrays in step.
+        {A, {A, A}, {{US, 100}, {low, 9}, {US, 50}, {low, 9}}, "0.201:2 | 0.1/100:2 0.2/9:2 +2"},
+        {B, {}, {{low, 9}}, "0.201:2 | 0.1/100:2 0.2/9:3 +1"},
+        {A, {A, A}, {{US, 100}, {low, 9}, {US, 50}, {low, 9}}, "0.201:2 | 0.1/100:2 0.2/9:3 +0"},
+        {A, {A, A}, {{low, 9}, {US, 100}, {low, 9}, {US, 50}}, "0.201:2 | 0.1/100:2 0.2/9:3 +0"},
+        {A, {A}, {{low, 9}, {US, 100}}, "0.201:1 | 0.1/100:1 0.2/9:2 +2"},
+        {A, {}, {}, "| 0.2/9:1 +2"},
+        // A weight follows the last report that differs from its router's own, which is no change of the
+        // view.
+        {A, {}, {{low, 9}, {US, 8}}, "| 0.2/9:2 0.1/8:1 +1"},
+        {B, {}, {{low, 5}, {US, 3}}, "| 0.1/8:2 0.2/5:2 +1"},
+        {B, {}, {{low, 5}, {US, 8}}, "| 0.1/8:2 0.2/5:2 +0"},
+        {A, {}, {{low, 9}, {US, 8}}, "| 0.1/8:2 0.2/5:2 +0"},
+    };
+    for (const auto &step : steps) {
+        see(step.from, step.routers, step.appliances);
+        EXPECT_EQ(views(), step.views) << "step " << &step - steps;
+        EXPECT_EQ((router(A)->flags & WCCP_RTR_TWO_WAY) != 0,
+                  wccp_get_router_appliance_view_element(router(A), US) != nullptr);
+    }
     // An entry that is there already is told and stays behind the head.
     auto *again = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof(wccp_view_appliance)));
-    again->ipa = host(13);
-    again->weight = 70;
+    again->ipa = US;
+    again->weight = 8;
     EXPECT_EQ(wccp_view_list_add_appliance_sorted(group, again), 1);
     EXPECT_EQ(group->appliance_view->next, again);
     list_unlink(again);
     wccp_free(again);
-    // Of equal weights the higher address, as a number, goes first.
-    const be32 low = to_be32(0x0a000002), high = to_be32(0x0a000101);
-    for (const appliances &list : {appliances{{low, 9}, {high, 9}}, appliances{{high, 9}, {low, 9}}}) {
-        report(ROUTER_A, {});
-        report(ROUTER_A, list);
-        EXPECT_EQ(group->appliance_view->ipa, high);
-    }
-}
-
-TEST_F(ViewTest, TheUnionCountsMentionsAndForgetsWithTheLast) {
-    EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, US), 1); // by none
-    see(ROUTER_A, {ROUTER_A, ROUTER_B}, {{US, 100}, {host(2), 100}});
-    see(ROUTER_B, {ROUTER_B}, {{host(2), 100}});
-    EXPECT_EQ(changes(), 4u);
-    EXPECT_EQ(mentions(group->router_view), (counts{{"10.0.0.201", 1}, {"10.0.0.202", 2}}));
-    EXPECT_EQ(mentions(group->appliance_view), (counts{{"10.0.0.1", 1}, {"10.0.0.2", 2}}));
-    EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, host(2)), 1);
-    EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, US), 0);
-    router(ROUTER_C); // not a word of appliances yet
-    EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, host(2)), 0);
-
-    report(ROUTER_A, {{US, 100}});
-    EXPECT_EQ(changes(), 1u);
-    EXPECT_EQ(mentions(group->appliance_view), (counts{{"10.0.0.1", 1}, {"10.0.0.2", 1}}));
-    see(ROUTER_B, {}, {});
-    EXPECT_EQ(changes(), 2u);
-    EXPECT_EQ(mentions(group->appliance_view), (counts{{"10.0.0.1", 1}}));
-    EXPECT_EQ(mentions(group->router_view), (counts{{"10.0.0.201", 1}, {"10.0.0.202", 1}}));
-    EXPECT_EQ(group->appliance_view_count, 1u);
-    EXPECT_EQ(group->router_view_count, 2u);
 }
 
 TEST_F(ViewTest, TheSameReportInAnyOrderIsNoChange) {
     std::vector<be32> routers;
-    appliances list;
+    reported_appliances list;
     for (uint32_t i = 0; i < 32; i++) {
         routers.push_back(host(200 - i));
         list.push_back({host(i + 1), 100});
     }
-    report_routers(ROUTER_A, routers);
-    report(ROUTER_A, list);
-    EXPECT_EQ(changes(), 2u);
+    EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, US), 1); // by none
+    see(ROUTER_A, routers, list);
+    EXPECT_EQ(group->change_number, 2u);
+    EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, US), 1);
     const uint32_t allocations = wccp_g.stat_allocs;
     // A dump shows whether the last report named what the one before it did.
     const auto marks = [a = router(ROUTER_A)] {
@@ -111,38 +121,14 @@ TEST_F(ViewTest, TheSameReportInAnyOrderIsNoChange) {
     };
     EXPECT_EQ(marks(), 0u);
     for (int round = 0; round < 2; round++) {
-        report_routers(ROUTER_A, routers);
-        report(ROUTER_A, list);
+        see(ROUTER_A, routers, list);
         EXPECT_EQ(marks(), 2u);
         std::swap(routers[3], routers[31]);
         std::swap(list[0], list[17]);
     }
-    EXPECT_EQ(changes(), 0u);
+    EXPECT_EQ(group->change_number, 2u);
     EXPECT_EQ(wccp_g.stat_allocs, allocations);
     EXPECT_EQ(router(ROUTER_A)->view_appliances[17].ipa, US); // the arrays follow the report's order
-}
-
-TEST_F(ViewTest, AnAddressNamedTwiceKeepsUnionAndArraysInStep) {
-    const appliances twice = {{US, 100}, {host(2), 100}, {US, 50}, {host(2), 100}};
-    report_routers(ROUTER_A, {ROUTER_A, ROUTER_A});
-    report(ROUTER_A, twice);
-    report(ROUTER_B, {{host(2), 100}});
-    changes();
-    for (int round = 0; round < 3; round++) {
-        report_routers(ROUTER_A, {ROUTER_A, ROUTER_A});
-        report(ROUTER_A, twice);
-        EXPECT_EQ(changes(), 0u);
-    }
-    report(ROUTER_A, {{host(2), 100}, {US, 100}, {host(2), 100}, {US, 50}});
-    EXPECT_EQ(changes(), 0u);
-    EXPECT_EQ(mentions(group->appliance_view), (counts{{"10.0.0.1", 2}, {"10.0.0.2", 3}}));
-    report(ROUTER_A, {{host(2), 100}, {US, 100}});
-    EXPECT_EQ(mentions(group->appliance_view), (counts{{"10.0.0.1", 1}, {"10.0.0.2", 2}}));
-    EXPECT_TRUE(router(ROUTER_A)->flags & WCCP_RTR_TWO_WAY) << "it is still listed once";
-    report(ROUTER_A, {});
-    report_routers(ROUTER_A, {});
-    EXPECT_EQ(mentions(group->appliance_view), (counts{{"10.0.0.2", 1}}));
-    EXPECT_EQ(group->router_view, nullptr);
 }
 
 TEST_F(ViewTest, ARouterIsTwoWayWhileItListsUs) {
@@ -168,25 +154,13 @@ TEST_F(ViewTest, ARouterIsTwoWayWhileItListsUs) {
     wccp_g.seconds = 0;
 }
 
-TEST_F(ViewTest, AWeightFollowsTheLastReportThatDiffersFromItsRoutersOwn) {
-    report(ROUTER_A, {{host(2), 100}, {host(3), 90}});
-    report(ROUTER_B, {{host(2), 70}, {host(3), 90}}); // known already: the entry keeps its weight
-    EXPECT_EQ(weights_in_order(), (std::vector<uint16_t>{100, 90}));
-    changes();
-    report(ROUTER_B, {{host(2), 60}, {host(3), 90}});
-    EXPECT_EQ(weights_in_order(), (std::vector<uint16_t>{90, 60}));
-    report(ROUTER_A, {{host(2), 100}, {host(3), 90}}); // nothing new from this one
-    EXPECT_EQ(weights_in_order(), (std::vector<uint16_t>{90, 60}));
-    EXPECT_EQ(changes(), 0u);
-}
-
 TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     report(ROUTER_A, {{US, 100}, {host(2), 100}});
     group->designated = 1;
-    changes();
+    views();
     router(ROUTER_A)->assign_tx_count = 3;
     EXPECT_EQ(report(ROUTER_A, {{US, 100}, {host(2), 300}}), 0);
-    EXPECT_EQ(changes(), 0u);
+    EXPECT_EQ(views(), "| 0.2/300:1 0.1/100:1 +0");
     EXPECT_EQ(group->dsg_key_change, 1u);
     EXPECT_EQ(group->assign_timer.countdown, 1u);
     EXPECT_EQ(group->pending_acks, 1);
