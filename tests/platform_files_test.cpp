@@ -61,8 +61,8 @@ struct Files : testing::Test {
 } // namespace
 
 TEST_F(Files, LimitsComeFromTheLinesThatAreGood) {
-    static const struct {
-        const char *text;
+    const struct {
+        std::string text;
         uint32_t tunnels, interfaces;
     } cases[] = {
         {"", 200, 128},
@@ -77,6 +77,9 @@ TEST_F(Files, LimitsComeFromTheLinesThatAreGood) {
          "max_interfaces \nmax_interfaces twelve\nmax_interfaces 4294967424\nmax_interfaces "
          "99999999999999999999999\nmax_interfacesx 3\nMAX_INTERFACES 3\nmax_interface 3\nmax_user_tunnels 8",
          8, 128},
+        // A line longer than any good one is one bad line, not several; a NUL hides nothing behind it.
+        {"max_interfaces 5" + std::string(5000, ' ') + "\nmax_user_tunnels 6\n", 6, 128},
+        {std::string(126, '#') + "\nmax_user_tunnels 6\na" + '\0' + "b\nmax_interfaces 7\n", 6, 7},
     };
     for (const auto &row : cases) {
         write_text(dir / "conf", row.text);
@@ -84,19 +87,13 @@ TEST_F(Files, LimitsComeFromTheLinesThatAreGood) {
         EXPECT_EQ(limits.max_user_tunnels, row.tunnels) << row.text;
         EXPECT_EQ(limits.max_interfaces, row.interfaces) << row.text;
     }
-    // A line longer than any good one is one bad line, not several; a NUL hides nothing behind it.
-    write_text(dir / "conf", "max_interfaces 5" + std::string(5000, ' ') + "\nmax_user_tunnels 6\n");
-    EXPECT_EQ(platform_limits_read((dir / "conf").c_str()).max_interfaces, 128u);
-    EXPECT_EQ(platform_limits_read((dir / "conf").c_str()).max_user_tunnels, 6u);
-    write_text(dir / "conf", std::string(126, '#') + "\nmax_user_tunnels 6\n" + std::string("a\0b\n", 4) +
-                                 "max_interfaces 7\n");
-    EXPECT_EQ(platform_limits_read((dir / "conf").c_str()).max_user_tunnels, 6u);
-    EXPECT_EQ(platform_limits_read((dir / "conf").c_str()).max_interfaces, 7u);
     EXPECT_EQ(platform_limits_read((dir / "none").c_str()).max_interfaces, 128u);
     EXPECT_EQ(platform_limits_read(dir.c_str()).max_interfaces, 128u);
-}
-
-TEST_F(Files, LimitsAreReadOnce) {
+    // The shipped file says what a missing one means.
+    const platform_limits shipped = platform_limits_read(WCCP_SOURCE_DIR "/packaging/platform.conf");
+    EXPECT_TRUE(shipped.max_user_tunnels == 200 && shipped.max_interfaces == 128);
+    EXPECT_TRUE(fs::exists(WCCP_SOURCE_DIR "/packaging/platform.conf"));
+    // They are read once.
     fs::create_directories(fs::path(PLATFORM_CONF_PATH).parent_path());
     write_text(PLATFORM_CONF_PATH, "max_user_tunnels 30\n");
     EXPECT_EQ(get_max_tunnel_number(), 52u);
@@ -105,53 +102,38 @@ TEST_F(Files, LimitsAreReadOnce) {
     EXPECT_EQ(qv_max_interfaces(), 128u);
 }
 
-TEST_F(Files, TheShippedFileSaysWhatAMissingOneMeans) {
-    const fs::path shipped = fs::path(WCCP_SOURCE_DIR) / "packaging/platform.conf";
-    ASSERT_TRUE(fs::exists(shipped));
-    const platform_limits with = platform_limits_read(shipped.c_str());
-    const platform_limits without = platform_limits_read((dir / "none").c_str());
-    EXPECT_EQ(with.max_user_tunnels, without.max_user_tunnels);
-    EXPECT_EQ(with.max_interfaces, without.max_interfaces);
-}
-
 TEST_F(Files, MissingDirectoriesAreMadeWithTheMode) {
-    EXPECT_EQ(lf_ensure_dir_of_file((dir / "a//b/./c/file").c_str(), 0755), 0);
-    EXPECT_EQ(mode_of(dir / "a"), 0755u) << "whatever the umask says";
-    EXPECT_EQ(mode_of(dir / "a/b/c"), 0755u);
+    const auto ensure = [](const fs::path &path) { return lf_ensure_dir_of_file(path.c_str(), 0755); };
+    EXPECT_EQ(ensure(dir / "a//b/./c/file"), LC_OK);
+    EXPECT_TRUE(mode_of(dir / "a") == 0755 && mode_of(dir / "a/b/c") == 0755) << "whatever the umask says";
     EXPECT_FALSE(fs::exists(dir / "a/b/c/file"));
     fs::permissions(dir / "a", fs::perms(0700));
-    EXPECT_EQ(lf_ensure_dir_of_file((dir / "a/other").c_str(), 0755), 0);
+    EXPECT_EQ(ensure(dir / "a/other"), LC_OK);
     EXPECT_EQ(mode_of(dir / "a"), 0700u) << "what was there is left alone";
     fs::create_directory_symlink("a/b", dir / "link");
-    EXPECT_EQ(lf_ensure_dir_of_file((dir / "link/d/file").c_str(), 0755), 0);
+    EXPECT_EQ(ensure(dir / "link/d/file"), LC_OK);
     EXPECT_TRUE(fs::is_directory(dir / "a/b/d"));
     write_text(dir / "plain", "x");
-    EXPECT_NE(lf_ensure_dir_of_file((dir / "plain/file").c_str(), 0755), 0);
+    EXPECT_EQ(ensure(dir / "plain/file"), LC_BAD_PATH);
     EXPECT_EQ(errno, ENOTDIR);
     fs::current_path(dir);
-    EXPECT_EQ(lf_ensure_dir_of_file("here/file", 0755), 0);
-    EXPECT_EQ(lf_ensure_dir_of_file("file", 0755), 0);
-    EXPECT_TRUE(fs::is_directory(dir / "here"));
+    EXPECT_TRUE(ensure("here/file") == LC_OK && ensure("file") == LC_OK && fs::is_directory(dir / "here"));
     fs::current_path("/");
-    EXPECT_NE(lf_ensure_dir_of_file(nullptr, 0755), 0);
-    EXPECT_NE(lf_ensure_dir_of_file(std::string(5000, 'x').c_str(), 0755), 0);
+    EXPECT_EQ(ensure(std::string(5000, 'x')), LC_BAD_PATH);
 }
 
 TEST_F(Files, AFileHasExactlyTheBytesAndTheMode) {
     const fs::path path = dir / "file";
-    const std::string binary("a\0b\n", 4);
-    EXPECT_EQ(write(path, binary), 0);
-    EXPECT_EQ(text_of(path), binary);
-    EXPECT_EQ(mode_of(path), 0644u) << "whatever the umask says";
-    EXPECT_EQ(write(path, "9", 1, 0600), 0);
-    EXPECT_EQ(text_of(path), "9") << "nothing of a longer one is left";
-    EXPECT_EQ(mode_of(path), 0600u);
-    EXPECT_EQ(write(path, "", 1, 0600), 0);
-    EXPECT_EQ(text_of(path), "");
+    for (const auto &[text, mode] : std::vector<std::pair<std::string, mode_t>>{
+             {std::string("a\0b\n", 4), 0644}, {"9", 0600}, {"", 0600}}) {
+        EXPECT_EQ(write(path, text, 1, mode), LC_OK);
+        EXPECT_EQ(text_of(path), text);
+        EXPECT_EQ(mode_of(path), mode) << "whatever the umask says";
+    }
     EXPECT_EQ(write(path, "new", 0), LC_IO_FILE_EXISTS);
     EXPECT_EQ(errno, EEXIST);
     EXPECT_EQ(text_of(path), "");
-    EXPECT_EQ(write(dir / "fresh", "new", 0), 0);
+    EXPECT_EQ(write(dir / "fresh", "new", 0), LC_OK);
     EXPECT_EQ(names_in(dir), 2u) << "and nothing else";
     EXPECT_EQ(write(dir / "none/file", "x"), LC_FILE_NOT_FOUND);
     EXPECT_EQ(errno, ENOENT);
@@ -160,20 +142,19 @@ TEST_F(Files, AFileHasExactlyTheBytesAndTheMode) {
 TEST_F(Files, WhatIsNotAPlainFileIsRefused) {
     write_text(dir / "target", "old");
     fs::create_symlink(dir / "target", dir / "link");
-    EXPECT_EQ(write(dir / "link", "new"), LC_BAD_FILE);
-    EXPECT_EQ(errno, ELOOP);
     fs::create_symlink(dir / "nowhere", dir / "dangling");
-    EXPECT_EQ(write(dir / "dangling", "new"), LC_BAD_FILE);
-    EXPECT_FALSE(fs::exists(dir / "nowhere"));
     fs::create_hard_link(dir / "target", dir / "second");
-    EXPECT_EQ(write(dir / "second", "new"), LC_BAD_FILE);
-    EXPECT_EQ(errno, EMLINK);
-    EXPECT_EQ(text_of(dir / "target"), "old");
-    ASSERT_EQ(mkfifo((dir / "pipe").c_str(), 0600), 0);
-    EXPECT_EQ(write(dir / "pipe", "new"), LC_BAD_FILE);
     fs::create_directory(dir / "directory");
-    EXPECT_EQ(write(dir / "directory", "new"), LC_BAD_FILE);
-    EXPECT_EQ(errno, EISDIR);
+    ASSERT_EQ(mkfifo((dir / "pipe").c_str(), 0600), 0);
+    for (const auto &[name, reason] : std::vector<std::pair<const char *, int>>{{"link", ELOOP},
+                                                                                {"dangling", ELOOP},
+                                                                                {"second", EMLINK},
+                                                                                {"directory", EISDIR},
+                                                                                {"pipe", EINVAL}}) {
+        EXPECT_EQ(write(dir / name, "new"), LC_BAD_FILE) << name;
+        EXPECT_EQ(errno, reason) << name;
+    }
+    EXPECT_EQ(text_of(dir / "target"), "old");
     EXPECT_EQ(names_in(dir), 6u);
 }
 
