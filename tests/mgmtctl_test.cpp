@@ -1,0 +1,370 @@
+// mgmtctl without mgmtd: what it shows, what it says of changes and of names that don't exist, and its
+// session with a provider made by hand.
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "platform/binding_text.h"
+#include "platform/mgmtctl/nodes.h"
+#include "platform/mgmtctl/render.h"
+#include "platform/mgmtctl/watch.h"
+#include "tests/support/gcl_provider.h"
+
+static const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config";
+static const std::string G51 = GROUPS + "/51";
+static const std::string STATES = "/qv/wccpd/wccp/srv_grp/state";
+
+// --- What is shown
+
+TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
+    const struct {
+        ctl_binding binding;
+        const char *json, *text;
+    } cases[] = {
+        {{"/a", "uint32", "4294967295"}, "4294967295", "/a = 4294967295\n"},
+        {{"/a", "int64", "-9223372036854775808"}, "-9223372036854775808", "/a = -9223372036854775808\n"},
+        {{"/a", "float64", "nan"}, "\"nan\"", "/a = nan\n"},
+        {{"/a", "bool", "true"}, "true", "/a = true\n"},
+        {{"/a", "duration_ms", "3723.004"}, "3723004", "/a = 3723.004\n"},
+        {{"/a", "ipv4addr", "10.0.0.1"}, "\"10.0.0.1\"", "/a = 10.0.0.1\n"},
+        {{"/a", "string", "7"}, "\"7\"", "/a = 7\n"},
+        {{"/a", "string", ""}, "\"\"", "/a =\n"},
+        {{"/a", "none", ""}, "null", "/a =\n"},
+        {{"/a", "string", "x\n y\n\n"}, "\"x\\n y\\n\\n\"", "/a =\n    x\n     y\n"},
+        {{"/a", "string", "\xff"}, "\"\\ufffd\"", "/a = \xff\n"},
+        {{"/a/password", "string", "geheim"}, "\"********\"", "/a/password = ********\n"},
+        {{"/a/password", "string", ""}, "\"\"", "/a/password =\n"},
+    };
+    for (const auto &one : cases) {
+        EXPECT_EQ(json_line(json_node(one.binding, false)["value"]), std::string(one.json) + "\n");
+        EXPECT_EQ(text_node(one.binding, false), one.text);
+    }
+    EXPECT_EQ(json_node({"/a/password", "string", "geheim"}, true)["value"], "geheim");
+}
+
+TEST(Shown, AlarmsAreGatheredFromTheirNodes) {
+    const std::string root = std::string(ALARM_ROOT) + "/196638/eth0:grp:51";
+    const std::vector<ctl_alarm> alarms = alarms_of({{root, "string", "No adjacency"},
+                                                     {root + "/name", "string", "adjacency"},
+                                                     {root + "/reporter", "string", "wccpd-5"},
+                                                     {root + "/since", "datetime_sec", "2026/01/02 03:04:05"},
+                                                     {std::string(ALARM_ROOT) + "/7/a\\/b", "string", "x"},
+                                                     {std::string(ALARM_ROOT) + "/7", "string", "no alarm"}});
+    ASSERT_EQ(alarms.size(), 2u);
+    EXPECT_EQ(json_line(json_alarms(alarms)[0]),
+              "{\"type\":196638,\"name\":\"adjacency\",\"source\":\"eth0:grp:51\",\"text\":\"No adjacency\","
+              "\"since\":\"2026/01/02 03:04:05\",\"reporter\":\"wccpd-5\"}\n");
+    EXPECT_EQ(alarms[1].source, "a/b");
+    EXPECT_EQ(text_alarms({alarms[0]}), "2026/01/02 03:04:05  adjacency  eth0:grp:51  No adjacency\n");
+}
+
+TEST(Shown, EventsOfEachKind) {
+    const std::string entry = "/mgmtd/notification/dbchange/";
+    const ctl_event change = {CHANGE_EVENT,
+                              {{entry + "09", "uint32", "9"},
+                               {entry + "09/change_type", "string", "modify"},
+                               {entry + "09/name", "string", G51 + "/password"},
+                               {entry + "09/new_attribs/value", "string", "neu"},
+                               {entry + "09/prev_attribs/value", "string", "alt"},
+                               {entry + "10/change_type", "string", "add"},
+                               {entry + "10/name", "string", G51 + "/weight"},
+                               {entry + "10/new_attribs/value", "uint32", "7"},
+                               {entry + "11/change_type", "string", "delete"},
+                               {entry + "11/name", "string", G51 + "/policy_grp"},
+                               {entry + "11/prev_attribs/value", "uint32", "3"}}};
+    EXPECT_EQ(
+        text_event(change, false),
+        (std::vector<std::string>{"modify " + G51 + "/password = ******** (was ********)",
+                                  "add    " + G51 + "/weight = 7", "delete " + G51 + "/policy_grp (was 3)"}));
+    const ctl_json told = json_event(change, true);
+    EXPECT_EQ(told["event"], "change");
+    EXPECT_EQ(told["changes"][0]["after"], "neu");
+    EXPECT_EQ(json_line(told["changes"][2]), "{\"name\":\"" + G51 +
+                                                 "/policy_grp\",\"change\":\"delete\",\"type\":\"uint32\","
+                                                 "\"before\":3,\"after\":null}\n");
+    const ctl_event raised = {"/qv/alarms/events/raise_alarm",
+                              {{"alarm_type", "string", "196639"},
+                               {"param_3", "string", "eth0:grp:51"},
+                               {"comment", "string", "No assignment"}}};
+    EXPECT_EQ(text_event(raised, false)[0], "alarm raised: eth0:grp:51 No assignment");
+    EXPECT_EQ(
+        json_line(json_event(raised, false)),
+        "{\"event\":\"alarm_raised\",\"type\":196639,\"name\":\"assignment\",\"source\":\"eth0:grp:51\","
+        "\"text\":\"No assignment\"}\n");
+    const ctl_event role = {"/qv/state/events/role_change",
+                            {{"group", "string", "51"}, {"role", "string", "0"}, {"code", "string", "3"}}};
+    EXPECT_EQ(text_event(role, false)[0], "role of group 51: ACTIVE");
+    EXPECT_EQ(json_event(role, false)["group"], 51);
+    const ctl_event crash = {"/pm/events/failure/crash", {{"process_name", "string", "wccpd"}}};
+    EXPECT_EQ(text_event(crash, false)[0], "process wccpd crashed");
+    EXPECT_EQ(json_line(json_event(crash, false)), "{\"event\":\"process_crash\",\"process\":\"wccpd\"}\n");
+    EXPECT_EQ(watch_pattern("/qv"), "/qv/**");
+    EXPECT_EQ(watch_pattern("/qv/*"), "/qv/*");
+}
+
+// --- Changes
+
+TEST(Changes, WordsOfASet) {
+    const struct {
+        std::vector<std::string> words;
+        std::string result; // "NAME|VALUE " each, or what is wrong
+    } cases[] = {
+        {{"/a", "1"}, "/a|1 "},
+        {{"/a", "b=c"}, "/a|b=c "},
+        {{"/a=b=c"}, "/a|b=c "},
+        {{"/a=", "/b=2"}, "/a| /b|2 "},
+        {{"/a", "1", "2"}, "expected NAME VALUE or NAME=VALUE, not \"/a\""},
+        {{"/a=1", "/b"}, "expected NAME VALUE or NAME=VALUE, not \"/b\""},
+        {{"=1"}, "expected NAME VALUE or NAME=VALUE, not \"=1\""},
+    };
+    for (const auto &one : cases) {
+        std::vector<ctl_change_item> items;
+        std::string result = parse_assignments(one.words, ctl_change::create, &items);
+        if (result.empty())
+            for (const ctl_change_item &item : items)
+                result += item.binding.name + "|" + item.binding.value + " ";
+        EXPECT_EQ(result, one.result);
+    }
+}
+
+TEST(Changes, WhatARunningGroupDoesNotFollowIsTold) {
+    const groups_before before = {{G51, GROUPS + "/52"},
+                                  {{G51 + "/priority", "uint32", "200"},
+                                   {G51 + "/policy_grp", "uint32", "3"},
+                                   {G51 + "/weight", "uint32", "100"},
+                                   {G51 + "/router/1", "uint8", "1"}}};
+    const auto set = [](const std::string &name, const std::string &value) {
+        return ctl_change_item{ctl_change::create, {name, "", value}};
+    };
+    const auto remove = [](const std::string &name) {
+        return ctl_change_item{ctl_change::remove, {name, "", ""}};
+    };
+    const struct {
+        std::vector<ctl_change_item> items;
+        std::vector<std::string> created;
+        std::vector<const char *> notes; // a piece of each
+    } cases[] = {
+        {{set(G51 + "/weight", "7")}, {}, {}},
+        {{set(G51 + "/priority", "200")}, {}, {}},
+        {{set(G51 + "/priority", "9"), set(G51 + "/router/2/ipaddr", "10.0.0.2")},
+         {},
+         {"group 51: a running group follows a change of priority, router only when"}},
+        {{remove(G51 + "/priority")}, {}, {"a change of priority only when"}},
+        {{remove(G51 + "/weight")}, {}, {}},
+        {{remove(G51 + "/interface")}, {}, {"a change of interface"}}, // it wasn't set, as far as is known
+        {{remove(G51 + "/policy_grp"), remove(G51 + "/router/1")},
+         {},
+         {"without policy_grp, router/1 wccpd lets"}},
+        {{remove(G51)}, {}, {}},
+        {{remove(G51 + "/router/1"), remove(G51)}, {}, {}},
+        {{set(GROUPS + "/53/weight", "7"), set(GROUPS + "/53/priority", "1")}, {GROUPS + "/53"}, {}},
+        {{set(GROUPS + "/53/weight", "7"), remove(GROUPS + "/52")}, {GROUPS + "/53"}, {}},
+        {{set(GROUPS + "/53/weight", "7"), set(G51 + "/weight", "7")},
+         {GROUPS + "/53"},
+         {"creates or deletes a group in that alone"}},
+        {{set("/qv/tunneld/system/config/mode", "bridge")}, {}, {}},
+    };
+    for (const auto &one : cases) {
+        const change_notes said = notes_of(one.items, before);
+        EXPECT_EQ(said.created, one.created);
+        ASSERT_EQ(said.notes.size(), one.notes.size()) << one.items[0].binding.name;
+        for (size_t i = 0; i < said.notes.size(); i++)
+            EXPECT_NE(said.notes[i].find(one.notes[i]), std::string::npos) << said.notes[i];
+    }
+}
+
+// --- Names
+
+namespace {
+// mgmtd and wccpd as far as queries go.
+struct tree {
+    std::vector<ctl_binding> nodes;
+    int asked = 0;
+    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out) {
+        asked++;
+        node_name root;
+        if (!parse_node_name(name, &root))
+            return true;
+        for (const ctl_binding &binding : nodes) {
+            node_name node;
+            EXPECT_TRUE(parse_node_name(binding.name, &node));
+            const bool child = node.is_under(root) && node.parts.size() == root.parts.size() + 1;
+            if (walk == ctl_walk::node      ? node == root
+                : walk == ctl_walk::subtree ? node == root || node.is_under(root)
+                                            : child)
+                out->bindings.push_back(binding);
+        }
+        return true;
+    }
+};
+} // namespace
+
+static tree sample() {
+    return {{{G51, "uint8", "51"},
+             {G51 + "/weight", "uint32", "100"},
+             {GROUPS + "/7", "uint8", "7"},
+             {"/logging/syslog/process/wccpd/log_level", "string", "info"},
+             {STATES + "/51", "string", "51"},
+             {STATES + "/51/num_appliances", "uint32", "2"},
+             {STATES + "/51/oper", "string", "ACTIVE"},
+             {STATES + "/51/appliance/1/ipaddr", "ipv4addr", "10.0.0.101"},
+             {STATES + "/51/appliance/1/weight", "uint32", "5"},
+             {STATES + "/51/appliance/2/ipaddr", "ipv4addr", "10.0.0.102"}}};
+}
+
+TEST(Names, AreCompletedToTheirNextPart) {
+    tree known = sample();
+    const ctl_ask ask = std::ref(known);
+    const struct {
+        std::string word, found; // separated by blanks
+    } cases[] = {
+        {"", "/"},
+        {"/", "/logging /qv"},
+        {"/qv/wccpd/w", "/qv/wccpd/wccp"},
+        {"/qv/wccpd/system/state/debug_",
+         "/qv/wccpd/system/state/debug_all /qv/wccpd/system/state/debug_global"},
+        {GROUPS + "/", GROUPS + "/7 " + G51},
+        {G51 + "/mask_dst", G51 + "/mask_dst_ip " + G51 + "/mask_dst_port"},
+        {"/logging/syslog/process/", "/logging/syslog/process/wccpd"},
+        {"/logging/syslog/action/file/\\/va", "/logging/syslog/action/file/\\/var\\/log\\/messages"},
+        {G51 + "/encap=", G51 + "/encap=gre " + G51 + "/encap=l2 " + G51 + "/encap=either"},
+        {G51 + "/hash_src_ip=f", G51 + "/hash_src_ip=false"},
+        {G51 + "/weight=", ""},
+        {"qv", ""},
+        {"//", ""},
+        {"/nobody/", ""},
+    };
+    for (const auto &one : cases) {
+        std::string found;
+        for (const std::string &candidate : completions(ask, one.word))
+            found += (found.empty() ? "" : " ") + candidate;
+        EXPECT_EQ(found, one.found) << one.word;
+    }
+    known.asked = 0;
+    (void)completions(ask, "/qv/wccpd/");
+    EXPECT_EQ(known.asked, 0) << "what is fixed needs no mgmtd";
+}
+
+TEST(Names, AMistypedOneGetsAHint) {
+    tree known = sample();
+    const ctl_ask ask = std::ref(known);
+    const struct {
+        std::string name, hint;
+    } cases[] = {
+        {"qv/wccpd", "a name begins with \"/\""},
+        {"/qv//wccpd", "a name has no empty part"},
+        {"/qv", "it has no value of its own; \"mgmtctl walk /qv\" lists what is below"},
+        {"/qv/wcpd/system", "did you mean /qv/wccpd?"},
+        {G51 + "/wieght", "did you mean " + G51 + "/weight?"},
+        {G51 + "/interface", "it can be set, and has no default"},
+        {GROUPS + "/52/weight", "there is no group 52"},
+        {G51 + "/zzzzzz", "\"mgmtctl walk " + G51 + "\" lists what there is"},
+        {"/xyz", "\"mgmtctl walk /\" lists what there is"},
+    };
+    for (const auto &one : cases)
+        EXPECT_EQ(hint_for_missing(ask, one.name), one.hint);
+    EXPECT_EQ(hint_for_unchangeable(ask, STATES + "/51/oper"), "it is a state: it can only be read");
+    EXPECT_EQ(hint_for_unchangeable(ask, G51 + "/weight"), "");
+}
+
+TEST(Names, AWalkTakesTheAppliancesAlong) {
+    tree known = sample();
+    for (const std::string &root : {std::string("/qv"), STATES + "/51", STATES + "/51/appliance"}) {
+        ctl_reply reply;
+        if (!root.ends_with("appliance"))
+            reply.bindings = {{STATES + "/51/num_appliances", "uint32", "2"},
+                              {STATES + "/51/oper", "string", "x"}};
+        ASSERT_TRUE(add_appliances(std::ref(known), root, &reply.bindings));
+        std::string found;
+        for (const ctl_binding &binding : reply.bindings)
+            found += binding.value + " ";
+        EXPECT_EQ(found,
+                  root.ends_with("appliance") ? "10.0.0.101 5 10.0.0.102 " : "2 10.0.0.101 5 10.0.0.102 x ");
+    }
+    // A number that can't be makes no endless row of questions.
+    std::vector<ctl_binding> many = {{STATES + "/51/num_appliances", "uint32", "4000000000"}};
+    known.asked = 0;
+    ASSERT_TRUE(add_appliances(std::ref(known), STATES, &many));
+    EXPECT_EQ(known.asked, 64);
+}
+
+// --- The session
+
+namespace {
+wire serialized(bn_request_msg *taken) {
+    const owned_request msg(taken);
+    owned_tbuffer frame;
+    taken->service_id = 2;
+    EXPECT_EQ(bn_request_msg_serialize(taken, 0, &frame.pointer), LC_OK);
+    return {reinterpret_cast<const char *>(tb_buf(frame.pointer)),
+            static_cast<size_t>(tb_length(frame.pointer))};
+}
+wire event_frame(const char *name) {
+    bn_request_msg *msg = nullptr;
+    EXPECT_EQ(bn_event_request_msg_create(&msg, name), LC_OK);
+    return frame_bytes(2, 7, serialized(msg));
+}
+wire answer_frame(uint32_t response_to, uint32_t code, const char *text) {
+    owned_response msg;
+    owned_tbuffer frame;
+    EXPECT_EQ(bn_query_response_msg_create(&msg.pointer, response_to, code, text), LC_OK);
+    msg.pointer->service_id = 2;
+    EXPECT_EQ(bn_response_msg_serialize(msg.pointer, 0, &frame.pointer), LC_OK);
+    return frame_bytes(2, 2,
+                       {reinterpret_cast<const char *>(tb_buf(frame.pointer)),
+                        static_cast<size_t>(tb_length(frame.pointer))});
+}
+} // namespace
+
+TEST(Session, ARequestGetsItsOwnAnswerAndEventsWaitForTheirTurn) {
+    gcl_provider provider;
+    std::string reason;
+    EXPECT_EQ(ctl_open(1000, &reason), nullptr);
+    EXPECT_EQ(reason, "mgmtd is not running (nothing listens at /tmp/gcl-socks/uds-provider-mgmtd)");
+    EXPECT_NE(access("/tmp/gcl-socks", F_OK), 0) << "whoever only asks makes nothing";
+
+    ASSERT_TRUE(provider.listen_as("mgmtd"));
+    std::thread peer([&] {
+        ASSERT_TRUE(provider.open_session());
+        wire query = provider.take_frame();
+        ASSERT_GT(query.size(), 48u);
+        const uint32_t id = number_at(query, 40);
+        provider.put(event_frame("/one") + answer_frame(id + 100, 0, "of another") + event_frame("/two") +
+                     answer_frame(id, 14008, "no"));
+        query = provider.take_frame();
+        provider.close_client();
+    });
+    ctl_session *session = ctl_open(3000, &reason);
+    ASSERT_NE(session, nullptr) << reason;
+    ctl_reply reply;
+    EXPECT_TRUE(ctl_query(session, ctl_walk::node, "/a", &reply, &reason)) << reason;
+    EXPECT_EQ(reply.code, 14008u);
+    EXPECT_EQ(reply.message, "no");
+    ctl_event event;
+    for (const char *name : {"/one", "/two"}) {
+        EXPECT_EQ(ctl_next_event(session, 0, &event, &reason), 1);
+        EXPECT_EQ(event.name, name);
+    }
+    EXPECT_EQ(ctl_next_event(session, 20, &event, &reason), 0);
+    EXPECT_FALSE(ctl_query(session, ctl_walk::node, "/a", &reply, &reason));
+    EXPECT_EQ(reason, "mgmtd closed the session during the request");
+    EXPECT_EQ(ctl_next_event(session, -1, &event, &reason), -1);
+    EXPECT_FALSE(ctl_query(session, ctl_walk::node, "/a", &reply, &reason)) << "it doesn't come back";
+    peer.join();
+    ctl_close(session);
+
+    // One that takes the connection and says nothing; one that refuses the service.
+    EXPECT_EQ(ctl_open(1200, &reason), nullptr);
+    EXPECT_EQ(reason, "mgmtd gave no answer in 1.200 s");
+    std::thread refusing([&] {
+        provider.accept_client(); // the one that gave up
+        ASSERT_TRUE(provider.accept_client() && provider.put(greeting_bytes(~0u, ~0u)));
+        (void)provider.take_frame();
+        const wire request = provider.take_frame();
+        provider.put(open_response_bytes(number_at(request, 32), 1, "no"));
+        (void)provider.take_frame();
+    });
+    EXPECT_EQ(ctl_open(3000, &reason), nullptr);
+    EXPECT_EQ(reason, "mgmtd refuses its service to us");
+    refusing.join();
+}
