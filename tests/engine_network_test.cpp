@@ -1,6 +1,6 @@
-// Sockets of an interface against a real one: a veth pair whose other end lies in a namespace of its own,
-// where the routers are. The receive thread is left out, but where it is the matter: datagrams are read by
-// hand.
+// Interfaces against real ones: a veth pair whose other end lies in a namespace of its own, where the routers
+// are. First the sockets, with datagrams read by hand; then the table, and what notifications make of it,
+// given by hand in every order that the kernel may choose.
 
 #include "engine/wccp_network.h"
 
@@ -10,14 +10,18 @@
 #include <netinet/in.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdio>
 #include <cstring>
 
 #include "engine/cthread.h"
 #include "engine/wccp_config.h"
+#include "engine/wccp_host.h"
 #include "engine/wccp_link_mgr.h"
+#include "platform/limits.h"
 #include "runtime/common.h"
 #include "tests/support/engine_fixture.h"
 
@@ -46,8 +50,17 @@ size_t open_descriptors() {
     return count;
 }
 
+constexpr uint32_t LIMIT = 4; // interfaces in the table
+
 class Network : public testing::Test {
 protected:
+    static void SetUpTestSuite() {
+        mkdir("/etc/opt/rvl", 0755);
+        FILE *conf = fopen(PLATFORM_CONF_PATH, "w");
+        ASSERT_NE(conf, nullptr);
+        fprintf(conf, "max_interfaces %u\n", LIMIT);
+        fclose(conf);
+    }
     // A table entry without a receive thread: whoever reads does so by hand.
     static wccp_interface *bare(const char *name) {
         wccp_interface *interface = &wccp_g.interfaces[wccp_g.if_count++];
@@ -62,7 +75,28 @@ protected:
         memset(pkt.data, fill, length);
         return pkt;
     }
-    void TearDown() override { wan->groups = nullptr; } // which lie on the stack of a test
+    // The interface's own receive thread takes over, and a router listens.
+    wccp_service_group *live_group(const std::vector<std::string> &routers = {"10.0.0.2"}) {
+        wan->rx_thread = nullptr;
+        engine.router_socket("10.0.0.2");
+        return engine.add_group(engine_fixture::group_config(61, routers));
+    }
+    static void make_active(wccp_service_group *known) {
+        known->state_flags = (known->state_flags & ~WCCP_STATE_MASK) | WCCP_STATE_ACTIVE;
+    }
+    static void tell_link(const char *name, uint32_t admin_up, uint32_t link_up) {
+        qv_if_state_info info = {};
+        strlcpy(info.name, name, sizeof info.name);
+        info.admin_up = admin_up;
+        info.link_up = link_up;
+        wccp_process_if_state_change(&info);
+    }
+    static void set_address(const std::string &address) { // none: ""
+        run_command("ip addr flush dev wan0");
+        if (!address.empty())
+            run_command("ip addr add " + address + "/24 dev wan0");
+        wccp_process_if_ipa_update("wan0");
+    }
 
     engine_fixture engine; // whose sockets are open
     wccp_interface *wan = engine.interface;
@@ -93,22 +127,6 @@ TEST_F(Network, SocketsCarryTheirOptions) {
     EXPECT_EQ(static_cast<uint32_t>(option(wan->mcast_fd, IP_MULTICAST_IF)), address_word("10.0.0.100"));
 }
 
-TEST_F(Network, OneThreadOutlivesTheSockets) {
-    wan->rx_thread = nullptr;
-    ASSERT_EQ(wccp_init_network_by_interface(wan), 0);
-    const cthread *thread = wan->rx_thread;
-    ASSERT_NE(thread, nullptr);
-    EXPECT_STREQ(thread->name, "WCCP_RX_wan0");
-    const size_t descriptors = open_descriptors();
-    run_command("ip addr add 10.0.0.9/24 dev wan0");
-    wan->ipa = ipa("10.0.0.9");
-    ASSERT_EQ(wccp_init_network_by_interface(wan), 0);
-    EXPECT_EQ(wan->rx_thread, thread);
-    EXPECT_EQ(threads_named("WCCP_RX_wan0"), 1);
-    EXPECT_EQ(bound_to(wan->ucast_fd).sin_addr.s_addr, address_word("10.0.0.9"));
-    EXPECT_EQ(open_descriptors(), descriptors);
-}
-
 TEST_F(Network, AFailedBindLeavesTheSocketOpenAndStopsAllSending) {
     const size_t descriptors = open_descriptors();
     wan->ipa = ipa("10.9.9.9"); // nobody here has it
@@ -116,7 +134,7 @@ TEST_F(Network, AFailedBindLeavesTheSocketOpenAndStopsAllSending) {
     EXPECT_GE(wan->ucast_fd, 0);
     EXPECT_EQ(wan->ucast_bound, 0u);
     EXPECT_EQ(wan->mcast_fd, -1);
-    wccp_if_add_group(&group, wan);
+    group.interfaces[0] = wan;
     group.mcast_configured = 1;
     group.mcast_ipa = ipa("224.0.0.5");
     wccp_pkt pkt = packet(100, 1);
@@ -145,6 +163,7 @@ TEST_F(Network, JoiningBindsOnceAndRepeatsWithoutHarm) {
     group.mcast_ipa = ipa("224.0.1.7");
     ASSERT_EQ(wccp_init_network_by_interface(wan), 0);
     EXPECT_EQ(bound_to(wan->mcast_fd).sin_addr.s_addr, address_word("224.0.1.7"));
+    wan->groups = nullptr;
 }
 
 TEST_F(Network, TheTtlReachesEverySocketThatTakesIt) {
@@ -179,7 +198,7 @@ TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
     EXPECT_EQ(wccp_tx_pkt(nullptr, &pkt), 0);
     EXPECT_EQ(wccp_tx_pkt(&group, nullptr), 0);
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 0) << "no interface";
-    wccp_if_add_group(&group, wan);
+    group.interfaces[0] = wan;
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 0) << "nobody to send to";
     group.ucast_routers[group.ucast_router_count++] = ipa("10.0.0.2");
     group.ucast_routers[group.ucast_router_count++] = ipa("10.0.0.3");
@@ -273,6 +292,148 @@ TEST_F(Network, TheKernelIsAskedForAddressAndState) {
     run_command("ip link show wan0 | grep -q '[<,]UP[,>]'");
     run_command("ip addr flush dev wan0");
     EXPECT_TRUE(is_zero(wccp_get_address("wan0")));
+}
+
+TEST_F(Network, TheTableGrowsToItsLimitAndKnowsNobodyTwice) {
+    strlcpy(wccp_primary_wan_interface_name, "lo", sizeof wccp_primary_wan_interface_name);
+    EXPECT_EQ(wccp_if_add_interface("wan0"), wan);
+    const wccp_interface *lo = wccp_if_add_interface("lo");
+    ASSERT_EQ(lo, &wccp_g.interfaces[1]);
+    EXPECT_EQ(wccp_g.primary_if, lo);
+    EXPECT_EQ(lo->ipa, ipa("127.0.0.1"));
+    EXPECT_EQ(lo->ready_flags, WCCP_ALL_READY);
+    EXPECT_EQ(lo->ucast_bound, 1u);
+    const wccp_interface *absent = wccp_if_add_interface("absent0");
+    ASSERT_NE(absent, nullptr);
+    EXPECT_TRUE(absent->ready_flags == 0 && absent->ucast_fd == -1 && !absent->rx_thread);
+    EXPECT_NE(wccp_if_add_interface("absent1"), nullptr);
+    EXPECT_EQ(wccp_if_add_interface("absent2"), nullptr);
+    EXPECT_EQ(wccp_if_find_interface("absent2"), nullptr);
+    EXPECT_EQ(wccp_if_add_interface("absent1"), &wccp_g.interfaces[3]);
+    EXPECT_EQ(wccp_g.primary_if, lo);
+    wccp_grp_config config = engine_fixture::group_config(1, {});
+    strlcpy(config.interface, "absent2", sizeof config.interface);
+    EXPECT_EQ(wccp_add_group(&config), 1);
+
+    for (uint32_t i = 0; i < LIMIT; i++)
+        EXPECT_EQ(wccp_if_add_group(&group, &wccp_g.interfaces[i]), 0);
+    EXPECT_EQ(wccp_if_add_group(&group, wan), 1);
+    EXPECT_EQ(wccp_if_add_group(nullptr, wan), 1);
+    EXPECT_EQ(wccp_if_add_group(&group, nullptr), 1);
+    for (wccp_interface &interface : wccp_g.interfaces)
+        interface.groups = nullptr;
+}
+
+TEST_F(Network, WhatConcernsNobodyIsIgnored) {
+    const wccp_interface before = *wan;
+    tell_link("other0", 0, 0);
+    wccp_process_if_ipa_update("other0");
+    wccp_process_if_ipa_update(nullptr);
+    wccp_process_if_state_change(nullptr);
+    tell_link("wan0", 1, 1); // up already
+    EXPECT_EQ(wccp_g.if_count, 1);
+    wccpd_exiting = 1;
+    tell_link("wan0", 0, 0);
+    set_address("10.0.0.7");
+    EXPECT_EQ(memcmp(&before, wan, sizeof before), 0);
+    wccpd_exiting = 0;
+    for (int i = 0; i < 2; i++) { // the second time it is the same address
+        wccp_process_if_ipa_update("wan0");
+        EXPECT_TRUE(wan->ipa_change_count == 1 && wan->start_count == 1);
+    }
+}
+
+TEST_F(Network, TheLinkStopsAndStartsTheGroups) {
+    wccp_service_group *known = live_group();
+    EXPECT_EQ(known->hia_timer.active, 1);
+    make_active(known);
+    tell_link("wan0", 1, 0); // up by its administrator, without a carrier
+    EXPECT_TRUE(wan->link_up == 0 && wan->ready_flags == WCCP_IPA_READY);
+    EXPECT_EQ(known->hia_timer.active, 0);
+    EXPECT_EQ(known->state_flags, WCCP_STATE_INIT);
+    tell_link("wan0", 0, 1);
+    tell_link("wan0", 0, 0);
+    EXPECT_TRUE(wan->link_down_count == 1 && wan->stop_count == 1);
+    tell_link("wan0", 1, 1);
+    EXPECT_EQ(wan->ready_flags, WCCP_ALL_READY);
+    EXPECT_TRUE(known->hia_timer.active == 1 && known->hia_timer.countdown == 1);
+    EXPECT_TRUE(engine.sent_to("10.0.0.2").empty()) << "no farewell over a link that is gone";
+    EXPECT_EQ(known->tx_link_drops, 1u);
+}
+
+TEST_F(Network, AddressAndLinkInEitherOrderEndInReady) {
+    const wccp_service_group *known = live_group();
+    for (const bool link_first : {true, false}) {
+        set_address("");
+        tell_link("wan0", 0, 0);
+        EXPECT_EQ(wan->ready_flags, 0u);
+        if (link_first)
+            tell_link("wan0", 1, 1);
+        set_address("10.0.0.100");
+        EXPECT_EQ(known->hia_timer.active, link_first ? 1 : 0);
+        tell_link("wan0", 1, 1);
+        EXPECT_EQ(wan->ready_flags, WCCP_ALL_READY);
+        EXPECT_EQ(known->hia_timer.active, 1);
+        EXPECT_EQ(known->appliance_ipa, ipa("10.0.0.100"));
+    }
+}
+
+// Deleted and made again while the notifier waited: what it reads when it gets the lock is the old address.
+TEST_F(Network, AnInterfaceMadeAgainWithItsAddressIsJoinedAgain) {
+    live_group({"224.0.1.61"});
+    ASSERT_EQ(wan->mcast_bound, 1u);
+    run_command("ip maddr show dev wan0 | grep -q 224.0.1.61");
+    run_command("ip link del wan0");
+    engine.peer.link("wan0", "10.0.0.100/24", "peer0", "");
+    ASSERT_TRUE(link_becomes("wan0", 1));
+    run_command("! ip maddr show dev wan0 | grep -q 224.0.1.61");
+    wccp_process_if_ipa_update("wan0");
+    EXPECT_EQ(wan->ipa_change_count, 0u);
+    EXPECT_EQ(wan->ready_flags, WCCP_ALL_READY);
+    run_command("ip maddr show dev wan0 | grep -q 224.0.1.61");
+    const int32_t fd = wan->mcast_fd;
+    wccp_process_if_ipa_update("wan0");
+    EXPECT_EQ(wan->mcast_fd, fd) << "the same device: nothing to open";
+}
+
+TEST_F(Network, AnAddressChangesGoesAndComes) {
+    // The farewell of the old address comes from the old socket, as long as the kernel lets it.
+    wccp_service_group *known = live_group();
+    const auto last_word = [](const std::vector<uint8_t> &message) {
+        return std::vector<uint8_t>(message.end() - 4, message.end());
+    };
+    make_active(known);
+    run_command("ip addr add 10.0.0.100/32 dev lo");
+    set_address("10.0.0.7");
+    const datagram farewell = receive_datagram(engine.sockets["10.0.0.2"]);
+    ASSERT_GE(farewell.bytes.size(), 12u);
+    EXPECT_EQ(farewell.from, "10.0.0.100");
+    EXPECT_EQ(last_word(farewell.bytes), (std::vector<uint8_t>{10, 0, 0, 100}));
+    EXPECT_EQ(known->appliance_ipa, ipa("10.0.0.7"));
+    EXPECT_EQ(known->state_flags, WCCP_STATE_INIT);
+    EXPECT_EQ(known->hia_timer.active, 1);
+    EXPECT_EQ(bound_to(wan->ucast_fd).sin_addr.s_addr, address_word("10.0.0.7"));
+    EXPECT_EQ(threads_named("WCCP_RX_wan0"), 1);
+    run_command("ip addr del 10.0.0.100/32 dev lo");
+
+    make_active(known);
+    const int32_t fd = wan->ucast_fd;
+    set_address("");
+    EXPECT_TRUE(engine.sent_to("10.0.0.2").empty()) << "nothing to send a farewell from";
+    EXPECT_TRUE(is_zero(known->appliance_ipa));
+    EXPECT_EQ(known->hia_timer.active, 0);
+    EXPECT_EQ(wan->ready_flags, WCCP_LINK_READY);
+    EXPECT_EQ(wan->ucast_fd, fd) << "the sockets stay until the next address";
+
+    set_address("10.0.0.9");
+    wccp_tick();
+    const datagram first = receive_datagram(engine.sockets["10.0.0.2"]);
+    ASSERT_EQ(first.bytes.size(), 108u);
+    EXPECT_EQ(first.from, "10.0.0.9");
+    EXPECT_EQ(memcmp(&first.bytes[48], "\x0a\x00\x00\x09", 4), 0) << "the web-cache id";
+    EXPECT_EQ(wan->ipa_change_count, 3u);
+    wccp_deinit_link_mgr();
+    EXPECT_TRUE(wan->ucast_fd == -1 && wan->mcast_fd == -1 && wan->ucast_bound == 0);
 }
 
 } // namespace
