@@ -30,26 +30,10 @@ struct TunnelledRouters : testing::Test {
     }
     // Runs `work` under the engine lock on a thread that is cancelled as soon as it waits for tunneld.
     void cancel_in_the_wait(void (*work)(wccp_service_group *group)) {
-        struct job {
-            void (*work)(wccp_service_group *group);
-            wccp_service_group *group;
-        } job = {work, shared->group};
-        pthread_t thread;
-        ASSERT_EQ(pthread_create(
-                      &thread, nullptr,
-                      [](void *argument) -> void * {
-                          const auto *what = static_cast<struct job *>(argument);
-                          const wccp_engine_lock lock;
-                          what->work(what->group);
-                          return nullptr;
-                      },
-                      &job),
-                  0);
-        tunneld.wait_for_command();
-        pthread_cancel(thread);
-        void *result = nullptr;
-        pthread_join(thread, &result);
-        ASSERT_EQ(result, PTHREAD_CANCELED);
+        cancel_while_it_waits(&tunneld, [this, work] {
+            const wccp_engine_lock lock;
+            work(group);
+        });
         ASSERT_EQ(pthread_mutex_trylock(&wccp_g.lock), 0) << "a lock that nobody holds any more";
         pthread_mutex_unlock(&wccp_g.lock);
         tunneld.answer_with(tunneld_does);
