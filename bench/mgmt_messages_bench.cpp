@@ -6,12 +6,10 @@
 #include <cstdlib>
 #include <cstring>
 #include <string>
-#include <thread>
 
 #include "mgmt/bnode_proto.h"
-#include "mgmt/gcl_records.h"
 #include "mgmt/owners.h"
-#include "tests/support/gcl_provider.h"
+#include "tests/support/hand_session.h"
 
 namespace {
 
@@ -120,37 +118,18 @@ void read_message(benchmark::State &state) {
     });
 }
 
-// A session, opened, whose provider is this same thread; the loop is played by hand.
-struct opened_session {
-    gcl_provider provider;
-    fdic *interests = nullptr;
-    gcl *instance = nullptr;
-    gcl_session *session = nullptr;
-    int64_t answers = 0, bindings = 0;
+struct answered_session : hand_session {
+    int64_t answers = 0;
 
-    static lc_status ignore_changes(const fdic_event_array *, void *) { return LC_OK; }
     static lc_status take_answer(gcl_session *, bn_response_msg *msg, void *data) {
-        auto *self = static_cast<opened_session *>(data);
         owned_bindings bindings;
         CHECK_STATUS(bn_response_get_takeover(msg, nullptr, nullptr, 0, &bindings.pointer, nullptr));
-        self->answers++;
-        self->bindings += bn_binding_array_length_quick(bindings.pointer);
+        static_cast<answered_session *>(data)->answers++;
         return LC_OK;
     }
-    opened_session() {
-        must(provider.listen_as("bench") && fdic_init(&interests, ignore_changes, nullptr) == LC_OK &&
-                 gcl_init(&instance, nullptr, interests) == LC_OK &&
-                 bn_set_global_callback_query_response_msg(instance, take_answer, this) == LC_OK &&
-                 gcl_session_client_new(instance, "bench", nullptr, 0, &session) == LC_OK &&
-                 gcl_session_client_connect_by_provider(session, "bench", 0) == LC_OK,
-             "session");
-        std::thread other([this] { must(provider.open_session(), "provider"); });
-        must(gcl_session_client_open_service_blocking(session, 2, 2, nullptr, 0, 3000) == LC_OK, "open");
-        other.join();
-    }
-    ~opened_session() {
-        (void)gcl_deinit(&instance);
-        (void)fdic_deinit(&interests);
+    answered_session() {
+        must(bn_set_global_callback_query_response_msg(instance, take_answer, this) == LC_OK && open(),
+             "open");
     }
     void answer(const std::string &frames, int64_t messages) {
         answers = 0;
@@ -160,7 +139,7 @@ struct opened_session {
                 send(provider.client, frames.data() + at, frames.size() - at, MSG_DONTWAIT | MSG_NOSIGNAL);
             at += sent > 0 ? static_cast<size_t>(sent) : 0;
             idle += at == frames.size();
-            (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_READABLE, session, nullptr);
+            read();
         }
         must(answers == messages, "an answer is missing");
     }
@@ -174,10 +153,10 @@ struct opened_session {
 };
 
 void query_and_answer(benchmark::State &state) {
-    opened_session with;
+    answered_session with;
     owned_response msg;
     fill_response(&msg.pointer, state.range(0));
-    const std::string answer = opened_session::frame_of(msg.pointer);
+    const std::string answer = answered_session::frame_of(msg.pointer);
     std::string question(1024, '\0');
     size_t sent = 0;
     const auto ask = [&] {
@@ -195,12 +174,12 @@ void query_and_answer(benchmark::State &state) {
 
 // Small messages that come together are taken out of one read.
 void burst(benchmark::State &state) {
-    opened_session with;
+    answered_session with;
     owned_response msg;
     fill_response(&msg.pointer, 1);
     std::string frames;
     for (int64_t i = 0; i < state.range(0); i++)
-        frames += opened_session::frame_of(msg.pointer);
+        frames += answered_session::frame_of(msg.pointer);
     measure(state, state.range(0), state.range(0), 0, frames.size(),
             [&] { with.answer(frames, state.range(0)); });
 }

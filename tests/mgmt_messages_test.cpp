@@ -1,9 +1,11 @@
+// Messages by their bytes, what a reader refuses, and the way of a message over a session into its callback.
 #include <gtest/gtest.h>
 
 #include <string>
 
 #include "mgmt/bnode_proto.h"
-#include "tests/support/log_lines.cpp" // this program is linked without the engine's helpers
+#include "tests/support/gcl_log.h"
+#include "tests/support/hand_session.h"
 #include "tests/support/owners.h"
 
 using request_owner = owner<bn_request_msg, bn_request_msg_free>;
@@ -14,128 +16,115 @@ using ids_owner = owner<uint32_array, uint32_array_free>;
 using string_owner = owner<tstring, ts_free>;
 using buffer_owner = owner<tbuffer, tb_free>;
 
-static std::string u8(uint32_t value) {
-    return std::string(1, static_cast<char>(value));
+static wire u8(uint32_t value) {
+    return be(value, 1);
 }
-static std::string u16(uint32_t value) {
-    return u8(value >> 8) + u8(value & 255);
+static wire u16(uint32_t value) {
+    return be(value, 2);
 }
-static std::string u32(uint32_t value) {
-    return u16(value >> 16) + u16(value & 0xffff);
+static wire u32(uint32_t value) {
+    return be(value, 4);
 }
-static std::string str(const std::string &text) {
+static wire str(const wire &text) {
     return u32(static_cast<uint32_t>(text.size())) + text;
 }
 // Kind, id, type and flags, and the value with its length.
-static std::string text_attribute(uint32_t id, uint32_t type, const std::string &text) {
+static wire text_attribute(uint32_t id, uint32_t type, const wire &text) {
     return u32(4) + u32(id) + u32(type) + u32(0) + str(text);
 }
-static const std::string room(32, '\0');
-
-static std::string bytes_of(const tbuffer *buffer) {
-    return {reinterpret_cast<const char *>(tb_buf(buffer)), static_cast<size_t>(tb_length(buffer))};
+static const wire room(32, '\0');
+static wire request(uint32_t type, const wire &rest) {
+    return u16(2) + u16(type) + u32(static_cast<uint32_t>(48 + rest.size())) + u32(7) + u32(8) + rest;
 }
-static void fill(tbuffer **out, const std::string &bytes) {
-    ASSERT_EQ(tb_new(out), 0);
-    ASSERT_EQ(tb_append_buf(*out, bytes.data(), static_cast<uint32_t>(bytes.size())), 0);
+static wire response(uint32_t type, const wire &rest) {
+    return u16(2) + u16(type) + u32(static_cast<uint32_t>(52 + rest.size())) + u32(7) + u32(8) + u32(41) +
+           rest;
 }
-static lc_status read_request(const std::string &bytes, bn_request_msg **out) {
-    buffer_owner buffer;
-    fill(&buffer, bytes);
-    return bn_request_msg_deserialize(buffer, 32, out);
-}
-static lc_status read_response(const std::string &bytes, bn_response_msg **out) {
-    buffer_owner buffer;
-    fill(&buffer, bytes);
-    return bn_response_msg_deserialize(buffer, 32, out);
-}
-
-// Reads back what was written, byte for byte, and refuses everything shorter.
-static void expect_request(bn_request_msg *msg, const std::string &golden) {
-    buffer_owner written;
-    ASSERT_EQ(bn_request_msg_serialize(msg, 32, &written), 0);
-    ASSERT_EQ(bytes_of(written), room + golden);
-    EXPECT_EQ(msg->length, 32 + golden.size());
-    request_owner read;
-    ASSERT_EQ(read_request(room + golden, &read), 0);
-    buffer_owner again;
-    ASSERT_EQ(bn_request_msg_serialize(read, 32, &again), 0);
-    EXPECT_EQ(bytes_of(again), room + golden);
-    for (size_t length = 0; length < golden.size(); length++) {
-        request_owner cut;
-        const lc_status status = read_request(room + golden.substr(0, length), &cut);
-        EXPECT_TRUE(status == LC_ASSERTION || status == LC_NO_BUFFER_SPACE) << length << ": " << status;
-        EXPECT_EQ(cut.pointer, nullptr);
-    }
-}
-static void expect_response(bn_response_msg *msg, const std::string &golden) {
-    buffer_owner written;
-    ASSERT_EQ(bn_response_msg_serialize(msg, 32, &written), 0);
-    ASSERT_EQ(bytes_of(written), room + golden);
-    response_owner read;
-    ASSERT_EQ(read_response(room + golden, &read), 0);
-    buffer_owner again;
-    ASSERT_EQ(bn_response_msg_serialize(read, 32, &again), 0);
-    EXPECT_EQ(bytes_of(again), room + golden);
-    for (size_t length = 0; length < golden.size(); length++) {
-        response_owner cut;
-        const lc_status status = read_response(room + golden.substr(0, length), &cut);
-        EXPECT_TRUE(status == LC_ASSERTION || status == LC_NO_BUFFER_SPACE) << length << ": " << status;
-    }
-}
-static std::string request_header(uint32_t type, size_t rest) {
-    return u16(100) + u16(type) + u32(static_cast<uint32_t>(48 + rest)) + u32(7) + u32(8);
-}
-static void number(bn_request_msg *msg) {
-    msg->service_id = 100;
+template <typename Message>
+static void number(Message *msg) {
+    msg->service_id = 2;
     msg->msg_id = 7;
     msg->transaction_id = 8;
 }
 
-TEST(messages, query_request_bytes) {
-    request_owner msg;
-    ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), 0);
-    number(msg);
-    uint32_t id = 0;
-    ASSERT_EQ(bn_query_request_msg_append_str(msg, bn_query_get, 0, "/a/b", &id), 0);
-    EXPECT_EQ(id, 1000u);
-    ASSERT_EQ(bn_query_request_msg_append_str(msg, bn_query_iterate, 0x3000, "/x\\/y", &id), 0);
-    EXPECT_EQ(id, 1001u);
-    const std::string rest = str("") + u32(2) + u32(1000) + u8(1) + u32(2) + str("a") + str("b") + u32(0) +
-                             u32(1) + u32(0) + u32(1001) + u8(1) + u32(1) + str("x/y") + u32(0) + u32(2) +
-                             u32(0x3000) + u32(0) + str("") + u32(0);
-    expect_request(msg, request_header(1, rest.size()) + rest);
+static wire bytes_of(const tbuffer *buffer) {
+    return {reinterpret_cast<const char *>(tb_buf(buffer)), static_cast<size_t>(tb_length(buffer))};
+}
+template <typename Message>
+static lc_status read(lc_status (*from)(const tbuffer *, uint32_t, Message **), const wire &bytes,
+                      Message **out) {
+    buffer_owner buffer;
+    EXPECT_EQ(tb_new_buf(&buffer, bytes.data(), static_cast<int32_t>(bytes.size())), 0);
+    return from(buffer, 32, out);
+}
+static lc_status read_request(const wire &bytes, bn_request_msg **out) {
+    return read(bn_request_msg_deserialize, bytes, out);
 }
 
-TEST(messages, set_action_and_event_bytes) {
-    request_owner set;
-    ASSERT_EQ(bn_set_request_msg_create(&set, 5), 0);
-    number(set);
+// Written it has these bytes, read and written again too, and everything shorter is refused.
+template <typename Owner, typename Message>
+static void expect_bytes(Message *msg, const wire &golden, lc_status (*to)(Message *, uint32_t, tbuffer **),
+                         lc_status (*from)(const tbuffer *, uint32_t, Message **)) {
+    buffer_owner written, again;
+    ASSERT_EQ(to(msg, 32, &written), 0);
+    ASSERT_EQ(bytes_of(written), room + golden);
+    EXPECT_EQ(msg->length, 32 + golden.size());
+    Owner copy;
+    ASSERT_EQ(read(from, room + golden, &copy), 0);
+    ASSERT_EQ(to(copy, 32, &again), 0);
+    EXPECT_EQ(bytes_of(again), room + golden);
+    for (size_t length = 0; length < golden.size(); length++) {
+        Owner cut;
+        const lc_status status = read(from, room + golden.substr(0, length), &cut);
+        EXPECT_TRUE(status == LC_ASSERTION || status == LC_NO_BUFFER_SPACE) << length << ": " << status;
+        EXPECT_EQ(cut.pointer, nullptr);
+    }
+}
+static void expect_request(bn_request_msg *msg, uint32_t type, const wire &rest) {
+    number(msg);
+    expect_bytes<request_owner>(msg, request(type, rest), bn_request_msg_serialize,
+                                bn_request_msg_deserialize);
+}
+static void expect_response(bn_response_msg *msg, uint32_t type, const wire &rest) {
+    number(msg);
+    expect_bytes<response_owner>(msg, response(type, rest), bn_response_msg_serialize,
+                                 bn_response_msg_deserialize);
+}
+
+TEST(messages, request_bytes) {
+    request_owner query, set, action, event;
+    uint32_t id = 0;
+    ASSERT_EQ(bn_query_request_msg_create(&query, 0, nullptr), 0);
+    ASSERT_EQ(bn_query_request_msg_append_str(query, bn_query_get, 0, "/a/b", &id), 0);
+    EXPECT_EQ(id, 1000u);
+    ASSERT_EQ(bn_query_request_msg_append_str(query, bn_query_iterate, 0x3000, "/x\\/y", &id), 0);
+    EXPECT_EQ(id, 1001u);
+    expect_request(query, 1,
+                   str("") + u32(2) + u32(1000) + u8(1) + u32(2) + str("a") + str("b") + u32(0) + u32(1) +
+                       u32(0) + u32(1001) + u8(1) + u32(1) + str("x/y") + u32(0) + u32(2) + u32(0x3000) +
+                       u32(0) + str("") + u32(0));
+
     binding_owner binding;
+    ASSERT_EQ(bn_set_request_msg_create(&set, 5), 0);
     ASSERT_EQ(bn_binding_new_str(&binding, "/n", bn_attrib_value, bn_type_str, 0, "v"), 0);
     ASSERT_EQ(bn_binding_set_str(binding, bn_attrib_revision_id, bn_type_str, 0, "r"), 0);
     ASSERT_EQ(bn_set_request_msg_append_binding_takeover(set, bn_set_reparent, 9, &binding.pointer, nullptr),
               0);
     EXPECT_EQ(binding.pointer, nullptr);
-    std::string rest = str("") + u32(1) + u32(1000) + u8(1) + u32(1) + str("n") + u32(2) +
+    expect_request(set, 3,
+                   str("") + u32(1) + u32(1000) + u8(1) + u32(1) + str("n") + u32(2) +
                        text_attribute(1, bn_type_str, "v") + text_attribute(129, bn_type_str, "r") + u32(5) +
-                       u32(9) + str("") + str("") + u32(5) + str("") + u32(0);
-    expect_request(set, request_header(3, rest.size()) + rest);
+                       u32(9) + str("") + str("") + u32(5) + str("") + u32(0));
 
-    request_owner action;
     ASSERT_EQ(bn_action_request_msg_create(&action, "/do"), 0);
-    number(action);
     ASSERT_EQ(bn_action_request_msg_append_new_binding(action, 0, "event_name", bn_type_name, "/e", nullptr),
               0);
-    rest = str("") + u32(1) + u32(1000) + u8(0) + u32(1) + str("event_name") + u32(1) +
-           text_attribute(1, bn_type_name, "/e") + str("/do");
-    expect_request(action, request_header(5, rest.size()) + rest);
+    expect_request(action, 5,
+                   str("") + u32(1) + u32(1000) + u8(0) + u32(1) + str("event_name") + u32(1) +
+                       text_attribute(1, bn_type_name, "/e") + str("/do"));
 
-    request_owner event;
     ASSERT_EQ(bn_event_request_msg_create(&event, "/happened"), 0);
-    number(event);
-    rest = str("") + u32(0) + str("/happened");
-    expect_request(event, request_header(7, rest.size()) + rest);
+    expect_request(event, 7, str("") + u32(0) + str("/happened"));
     string_owner name;
     EXPECT_EQ(bn_action_request_msg_get_action_name(event, &name), LC_ASSERTION);
     ASSERT_EQ(bn_event_request_msg_get_event_name(event, &name), 0);
@@ -143,24 +132,38 @@ TEST(messages, set_action_and_event_bytes) {
     EXPECT_EQ(bn_query_request_msg_append_str(event, bn_query_get, 0, "/a", nullptr), LC_ASSERTION);
 }
 
+// A query asks for attributes by their ids alone; a registration carries them.
+TEST(messages, attributes_asked_for) {
+    binding_owner mask;
+    ASSERT_EQ(bn_binding_new_uint32(&mask, "/m", bn_attrib_capability_mask, 0, 6), 0);
+    for (const uint32_t subop : {bn_query_get, bn_query_registration_info}) {
+        request_owner msg;
+        ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), 0);
+        ASSERT_EQ(bn_query_request_msg_append_with_attribs(msg, subop, 0, "/a", mask->attributes, nullptr),
+                  0);
+        const bool given = subop == bn_query_registration_info;
+        expect_request(msg, 1,
+                       str("") + u32(1) + u32(1000) + u8(1) + u32(1) + str("a") + u32(1) + u32(1) + u32(69) +
+                           (given ? u32(bn_type_uint32) + u32(0) + u32(4) + u32(6)
+                                  : u32(bn_type_none) + u32(0) + u32(0)) +
+                           u32(subop) + u32(0) + u32(0) + str("") + u32(0));
+    }
+}
+
 TEST(messages, response_bytes_and_reading) {
     response_owner msg, copy;
     ASSERT_EQ(bn_query_response_msg_create(&msg, 41, 3, "no"), 0);
-    msg->service_id = 100;
-    msg->msg_id = 7;
-    msg->transaction_id = 8;
     msg->db_revision_id = 99;
     binding_owner binding;
     ASSERT_EQ(bn_binding_new_str(&binding, "/n", bn_attrib_value, bn_type_str, 0, "v"), 0);
     ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg, &binding.pointer, 1004), 0);
-    const std::string rest = u32(3) + str("no") + u32(1) + u32(1004) + u8(1) + u32(1) + str("n") + u32(1) +
-                             text_attribute(1, bn_type_str, "v") + u32(99);
-    expect_response(msg, u16(100) + u16(2) + u32(static_cast<uint32_t>(52 + rest.size())) + u32(7) + u32(8) +
-                             u32(41) + rest);
+    expect_response(msg, 2,
+                    u32(3) + str("no") + u32(1) + u32(1004) + u8(1) + u32(1) + str("n") + u32(1) +
+                        text_attribute(1, bn_type_str, "v") + u32(99));
     ASSERT_EQ(bn_response_msg_dup(msg, &copy), 0);
-    uint32_t code = 0;
-    string_owner message;
     for (int round = 0; round < 3; round++) { // by copy, by takeover, from what that left
+        uint32_t code = 0;
+        string_owner message;
         bindings_owner bindings;
         ids_owner ids;
         ASSERT_EQ(round == 0 ? bn_response_get(msg, &code, &message, 1, &bindings, &ids)
@@ -176,48 +179,46 @@ TEST(messages, response_bytes_and_reading) {
         EXPECT_EQ(got->parts != nullptr, round == 0);
         EXPECT_EQ(uint32_array_get_quick(ids, 0), 1004u);
     }
-    EXPECT_EQ(bn_response_per_node_array_length_quick(copy->nodes), 1u);
     EXPECT_NE(bn_response_per_node_array_get_quick(copy->nodes, 0)->binding, nullptr);
 
-    response_owner acknowledged;
-    ASSERT_EQ(bn_response_msg_create(&acknowledged, bn_msg_event_ack, 1, 0, nullptr), 0);
-    expect_response(acknowledged,
-                    u16(0) + u16(8) + u32(64) + u32(0) + u32(0) + u32(1) + u32(0) + str("") + u32(0));
-    EXPECT_EQ(bn_query_response_msg_append_binding_takeover(acknowledged, &binding.pointer, 0), LC_ASSERTION);
-    uint32_t revision = 0;
-    EXPECT_EQ(bn_query_response_msg_get_db_revision_id(acknowledged, &revision), LC_ASSERTION);
+    for (const uint16_t type : {bn_msg_set_response, bn_msg_action_response, bn_msg_event_ack}) {
+        response_owner other;
+        uint32_t revision = 0;
+        ASSERT_EQ(bn_response_msg_create(&other, type, 41, 0, nullptr), 0);
+        expect_response(other, type, u32(0) + str("") + u32(0) + (type == 4 ? u32(0) : wire()));
+        EXPECT_EQ(bn_query_response_msg_append_binding_takeover(other, &binding.pointer, 0), LC_ASSERTION);
+        EXPECT_EQ(bn_query_response_msg_get_db_revision_id(other, &revision), LC_ASSERTION);
+    }
 }
 
 // Announcements that no bytes stand behind, and values that are no values.
 TEST(messages, lies_are_refused) {
-    const std::string start = room + request_header(7, 0) + str("");
-    const std::string node = u32(1) + u32(1000) + u8(1);
-    const std::string named = start + node + u32(1) + str("n");
-    const std::string huge = u32(UINT32_MAX);
-    const std::string bodies[] = {
+    const wire start = room + request(7, str("")), node = u32(1) + u32(1000) + u8(1);
+    const wire named = start + node + u32(1) + str("n"), huge = u32(UINT32_MAX);
+    const wire bodies[] = {
         start + huge,
         start + node + huge,
         named + huge,
-        room + request_header(7, 0) + huge,
+        room + request(7, "") + huge,
         named + u32(1) + u32(4) + huge + u32(bn_type_str) + u32(0) + str("v"),
         named + u32(1) + u32(4) + u32(1) + u32(135) + u32(0) + str("v"),
         named + u32(1) + u32(4) + u32(1) + u32(0) + u32(0) + str("v"),
         named + u32(1) + u32(4) + u32(1) + u32(19) + u32(0) + str("v"),
         named + u32(1) + u32(4) + u32(1) + u32(bn_type_str) + u32(0) + huge + "v",
     };
-    for (const std::string &body : bodies) {
+    for (const wire &body : bodies) {
         request_owner msg;
-        EXPECT_NE(read_request(body + std::string(8, '\0'), &msg), 0);
+        EXPECT_NE(read_request(body + wire(8, '\0'), &msg), 0);
         EXPECT_EQ(msg.pointer, nullptr);
     }
 }
 
 TEST(messages, odd_messages_are_read) {
-    const std::string start = room + request_header(7, 0) + str("") + u32(1) + u32(1000);
+    const wire start = room + request(7, str("") + u32(1) + u32(1000));
     for (uint32_t absolute : {0u, 1u}) { // a name of no parts
         request_owner msg;
-        ASSERT_EQ(read_request(start + u8(absolute) + u32(0) + u32(0) + str("e"), &msg), 0);
         bindings_owner bindings;
+        ASSERT_EQ(read_request(start + u8(absolute) + u32(0) + u32(0) + str("e"), &msg), 0);
         ASSERT_EQ(bn_request_get(msg, nullptr, nullptr, 1, &bindings, nullptr, nullptr), 0);
         EXPECT_STREQ(bn_binding_get_name_quick(bn_binding_array_get_quick(bindings, 0)), absolute ? "/" : "");
     }
@@ -231,12 +232,162 @@ TEST(messages, odd_messages_are_read) {
     ASSERT_EQ(bn_binding_get_tstr(node->binding, 1, 0, nullptr, &value), 0);
     EXPECT_STREQ(ts_str(value), "w");
 
-    log_lines log;
+    gcl_log log;
     request_owner unknown;
-    ASSERT_EQ(read_request(room + request_header(9, 0) + str("") + u32(0), &unknown), 0);
-    EXPECT_NE(log.take().find("illegal messsage of type 9"), std::string::npos);
+    ASSERT_EQ(read_request(room + request(9, str("") + u32(0)), &unknown), 0);
+    EXPECT_EQ(log.count("illegal messsage of type 9"), 1);
     EXPECT_EQ(bn_request_get(unknown, nullptr, nullptr, 0, nullptr, nullptr, nullptr), LC_UNEXPECTED_CASE);
     EXPECT_EQ(bn_request_msg_response_msg_type(bn_msg_event), bn_msg_event_ack);
     EXPECT_EQ(bn_request_msg_response_msg_type(2), 0);
-    EXPECT_NE(log.take().find("Request message had unrecognized message type: 2"), std::string::npos);
+    EXPECT_EQ(log.count("Request message had unrecognized message type: 2"), 1);
+}
+
+// ---- Over a session
+
+struct MessageSession : testing::Test {
+    gcl_log log;
+    hand_session with;
+    std::string calls;
+
+    template <typename Message>
+    static lc_status note(gcl_session *session, Message *msg, void *data) {
+        auto *self = static_cast<MessageSession *>(data);
+        self->calls += std::to_string(msg->msg_type) + " ";
+        if (msg->msg_type != bn_msg_query_request)
+            return LC_BAD_TYPE; // what a callback returns is dropped
+        response_owner answer;
+        EXPECT_EQ(bn_query_response_msg_create(&answer, msg->msg_id, 0, nullptr), 0);
+        return bn_response_msg_send(session, answer);
+    }
+    static wire message(uint32_t type) {
+        if (type % 2 == 0 && type >= 2 && type <= 8)
+            return response(type, u32(0) + str("told") + u32(0) + (type < 6 ? u32(1) : wire()));
+        const wire trailer = type < 5 ? u32(0) + str("") + u32(0) : str("/name");
+        return request(type, str("") + u32(0) + (type < 8 && type % 2 ? trailer : wire()));
+    }
+    bool receive(uint32_t type, const wire &body) {
+        return with.deliver(frame_bytes(2, static_cast<uint16_t>(type), body));
+    }
+};
+
+TEST_F(MessageSession, EachTypeReachesItsCallback) {
+    bn_set_global_callback_query_request_msg(with.instance, note, this);
+    bn_set_global_callback_query_response_msg(with.instance, note, this);
+    bn_set_global_callback_set_request_msg(with.instance, note, this);
+    bn_set_global_callback_set_response_msg(with.instance, note, this);
+    bn_set_global_callback_action_request_msg(with.instance, note, this);
+    bn_set_global_callback_action_response_msg(with.instance, note, this);
+    bn_set_global_callback_event_request_msg(with.instance, note, this);
+    bn_set_global_callback_event_response_msg(with.instance, note, this);
+    ASSERT_TRUE(with.open());
+    for (uint32_t type = 1; type <= 8; type++)
+        EXPECT_TRUE(receive(type, message(type))) << type;
+    EXPECT_EQ(calls, "1 2 3 4 5 6 7 8 ");
+    EXPECT_EQ(log.count("Error code"), 0);
+    const wire answer = with.provider.take_frame(); // sent from inside the callback
+    EXPECT_EQ(number_at(answer, 26, 2), 2u);
+    EXPECT_EQ(number_at(answer, 48), 7u);
+}
+
+TEST_F(MessageSession, WhatNobodyTakesIsTold) {
+    ASSERT_TRUE(with.open());
+    bn_set_global_callback_query_request_msg(with.instance, note, this); // too late for this session
+    const struct {
+        uint32_t type;
+        wire body;
+        const char *line;
+    } cases[] = {
+        {1, message(1), "session 1: proto bnode: no query request callback"},
+        {2, message(2), "session 1: proto bnode: no query response callback: code = 0 msg = told"},
+        {3, message(3), "session 1: proto bnode: no set request callback"},
+        {4, message(4), "session 1: proto bnode: no set response callback: code = 0 msg = told"},
+        {5, message(5), "session 1: proto bnode: no action request callback"},
+        {6, message(6), "session 1: proto bnode: no action response callback: code = 0 msg = told"},
+        {7, message(7), "session 1: proto bnode: no event request callback"},
+        {8, message(8), "session 1: proto bnode: no event response callback: code = 0 msg = told"},
+        {0, message(0), "session 1: proto bnode: invalid body message type 0"},
+        {9, message(9), "session 1: proto bnode: invalid body message type 9"},
+        {10, message(10), "session 1: proto bnode: invalid body message type 10"},
+        {2, wire("\x00\x03", 2) + message(2).substr(2), "session 1: service 3 not open: 2"},
+    };
+    for (const auto &row : cases) {
+        EXPECT_TRUE(receive(row.type, row.body)) << row.line;
+        EXPECT_EQ(log.count(row.line), 1) << row.line;
+        log.clear();
+    }
+    bn_set_session_callback_query_request_msg(with.session, note, this);
+    EXPECT_TRUE(receive(1, message(1)));
+    EXPECT_EQ(calls, "1 ");
+    EXPECT_FALSE(receive(7, request(7, str("") + u32(0) + u32(9) + "cut")));
+    EXPECT_GE(log.count("Error code 14011"), 1);
+    EXPECT_EQ(log.count("session 1: closing after error condition"), 1);
+    EXPECT_EQ(log.count("messsage"), 0);
+}
+
+TEST_F(MessageSession, SentMessagesAreNumbered) {
+    ASSERT_TRUE(with.open());
+    request_owner first, second;
+    response_owner third;
+    ASSERT_EQ(bn_event_request_msg_create(&first, "/e"), 0);
+    ASSERT_EQ(bn_action_request_msg_create(&second, "/a"), 0);
+    ASSERT_EQ(bn_request_set_transaction_id(second, 77), 0);
+    ASSERT_EQ(bn_response_msg_create(&third, bn_msg_event_ack, 41, 0, nullptr), 0);
+    ASSERT_EQ(bn_request_msg_send(with.session, first), 0);
+    ASSERT_EQ(bn_request_msg_send(with.session, second), 0);
+    ASSERT_EQ(bn_response_msg_send(with.session, third), 0);
+    const uint32_t expected[][3] = {{7, 1, 2}, {5, 2, 77}, {8, 3, 4}}; // type, id, transaction
+    for (const auto &[type, id, transaction] : expected) {
+        const wire frame = with.provider.take_frame();
+        ASSERT_GE(frame.size(), 48u);
+        EXPECT_EQ(number_at(frame, 24), 0x20000u | type);
+        EXPECT_EQ(number_at(frame, 32), 0x20000u | type); // service 2
+        EXPECT_EQ(number_at(frame, 36), frame.size());
+        EXPECT_EQ(number_at(frame, 40), id);
+        EXPECT_EQ(number_at(frame, 44), transaction);
+    }
+    EXPECT_EQ(gcl_session_close(with.session, 0), 0);
+    EXPECT_EQ(bn_request_msg_send(with.session, first), 0);
+    EXPECT_EQ(log.count("Dropping request to non-connected session 1"), 1);
+    EXPECT_EQ(bn_response_msg_send(with.session, third), 0);
+    EXPECT_EQ(log.count("Dropping response to non-connected session 1"), 1);
+}
+
+TEST_F(MessageSession, WhatIsSentIsDumped) {
+    ASSERT_TRUE(with.open());
+    ASSERT_EQ(lc_log_set_max_log_level("debug"), 0);
+    const auto dump_of = [&](auto send) {
+        std::string dump;
+        log.clear();
+        EXPECT_EQ(send(), 0);
+        log.settle();
+        for (const std::string &line : log.lines)
+            if (const size_t at = line.find("SEND RE"); at != wire::npos)
+                dump += line.substr(at, line.find('\n', at) - at) + "\n";
+        return dump;
+    };
+    const std::string names = " hand-" + std::to_string(getpid()) + " mgmtd-1 service 2 type ";
+    request_owner set, event;
+    binding_owner binding;
+    ASSERT_EQ(bn_set_request_msg_create(&set, 0), 0);
+    ASSERT_EQ(bn_binding_new_uint32(&binding, "/n", bn_attrib_value, 0, 7), 0);
+    ASSERT_EQ(bn_set_request_msg_append_binding_takeover(set, bn_set_create, 9, &binding.pointer, nullptr),
+              0);
+    EXPECT_EQ(dump_of([&] { return bn_request_msg_send(with.session, set); }),
+              "SEND REQ:" + names + "3 (set_request) msg id 1\n" +
+                  "SEND REQ: audit userinfo string - \nSEND REQ: num nodes: 1\n"
+                  "SEND REQ: rn[0]: id 1000 /n\nSEND REQ: rn[0]: set subop: create flags: 00000009\n"
+                  "SEND REQ: rn[0]: attrib 1(value) type 5(uint32) value \"7\"\n");
+    response_owner answer;
+    ASSERT_EQ(bn_action_response_msg_create(&answer, 41, 3, "no"), 0);
+    EXPECT_EQ(dump_of([&] { return bn_response_msg_send(with.session, answer); }),
+              "SEND RESP: ret code: 3 ret msg: \"no\"\nSEND RESP:" + names +
+                  "6 (action_response) msg id 2 to 41\nSEND RESP: num nodes: 0\n");
+    ASSERT_EQ(bn_event_request_msg_create(&event, "/e"), 0);
+    for (int i = 0; i < 51; i++)
+        ASSERT_EQ(bn_event_request_msg_append_new_binding(event, 0, "n", bn_type_str, "", nullptr), 0);
+    const std::string dump = dump_of([&] { return bn_request_msg_send(with.session, event); });
+    EXPECT_NE(dump.find("event name: /e\n"), wire::npos);
+    EXPECT_NE(dump.find("num nodes: 51 (but only logging the first 50)\n"), wire::npos);
+    EXPECT_NE(dump.find("rn[49]: id 1049 n\n"), wire::npos);
+    EXPECT_EQ(dump.find("rn[50]"), wire::npos);
 }
