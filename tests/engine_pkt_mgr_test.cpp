@@ -158,6 +158,10 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
          0,
          {0, 0, 0, 0, 1, 1},
          "WCCP: unloading router query failed."},
+        {query(1, 100),
+         0,
+         {0, 0, 0, 0, 1},
+         "WCCP GRP 51: removal query request. cannot find router. (router id 10.0.0.1)"},
         {query(1, 101),
          0,
          {0, 0, 0, 0, 1},
@@ -371,30 +375,6 @@ TEST_F(Messages, TheDigestDecides) {
     EXPECT_EQ(process(good), 1);
     EXPECT_EQ(group->rx_auth_mismatches, 2u);
     EXPECT_EQ(group->rx_icus, 1u);
-}
-
-TEST_F(Messages, ARemovalQueryIsAnsweredThreeTimesWithTheSameBytes) {
-    process(icu(1, view(1, {{100, 100, 0}})));
-    group->hia_timer.active = 0;
-    EXPECT_EQ(process(query(1, 100)), 0);
-    EXPECT_EQ(group->rx_removal_failures, 0u);
-    EXPECT_EQ(group->removal_reply_count, 1u);
-    pass_seconds(1);
-    const bytes reply = engine.sent_to("10.0.0.1");
-    ASSERT_GT(reply.size(), 100u);
-    EXPECT_EQ(reply[3], 10);
-    EXPECT_EQ(bytes(reply.begin() + 108, reply.begin() + 112), (bytes{0, 0, 0, 0x99}))
-        << "the query's receive id";
-    group->weight++; // what was prepared stays as it is
-    for (int i = 0; i < 2; i++) {
-        pass_seconds(1);
-        EXPECT_EQ(engine.sent_to("10.0.0.1"), reply);
-    }
-    pass_seconds(2);
-    EXPECT_EQ(engine.sent_to("10.0.0.1"), bytes{});
-    EXPECT_EQ(engine.sent_to("10.0.0.2"), bytes{});
-    EXPECT_EQ(group->tx_removal_replies, 3u);
-    EXPECT_EQ(group->removal_reply_count, 0u);
 }
 
 TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {

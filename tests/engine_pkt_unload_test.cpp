@@ -249,20 +249,6 @@ TEST_F(Unload, SecurityHasItsDigestInThePacket) {
     }
 }
 
-TEST_F(Unload, AViewIsHandedOutInPlace) {
-    received_packet pkt = at(view(2, 2, 2, {hash_element(100, 7), short_element(101, 8)}), 3);
-    wccp_rtr_view_info out;
-    ASSERT_EQ(wccp_pkt_unload_router_view_component(&group, pkt.get(), &out), 0);
-    EXPECT_EQ(to_host(out.change_number), 0xc1c2c3c4u);
-    EXPECT_EQ(out.key_ipa, (be32{{10, 0, 0, 100}}));
-    EXPECT_EQ(to_host(out.key_change), 0x0a0b0c0du);
-    EXPECT_TRUE(out.router_count == 2 && out.appliance_count == 2);
-    EXPECT_EQ(reinterpret_cast<const uint8_t *>(out.routers), pkt->data + 3 + 20);
-    EXPECT_EQ(out.routers[1], (be32{{10, 0, 1, 2}}));
-    EXPECT_EQ(out.appliances, pkt->data + 3 + 32);
-    EXPECT_EQ(pkt->offset, 3u + 32 + 44 + 16);
-}
-
 // The compatibility mode is the form of one element, and nothing else.
 TEST_F(Unload, TheFormOfAnElementFollowsFlagsAndMode) {
     const struct {
@@ -324,14 +310,6 @@ TEST_F(Unload, CapabilitiesTakeTheLastOfEachKind) {
     pkt = at(hex("0008 0018").add(capability(1, 2)).add(capability(2, 2)).add(capability(3, 2)));
     ASSERT_EQ(wccp_pkt_unload_capability_info_component(&group, pkt.get(), &out), 0);
     EXPECT_EQ(log.take(), "");
-}
-
-TEST_F(Unload, ACommandIsPassedByItsDeclaredLength) {
-    received_packet pkt = at(hex("000f 0014 0001 0004 01020304").fill(12, 9).u32(0));
-    wccp_command_info out;
-    ASSERT_EQ(wccp_pkt_unload_command_ext_component(&group, pkt.get(), &out), 0);
-    EXPECT_TRUE(out.command == 1 && out.data == 0x01020304);
-    EXPECT_EQ(pkt->offset, 24u);
 }
 
 } // namespace

@@ -1,7 +1,7 @@
 // Sending routers: the capability decision, creation and its limits, removal, and Removal Queries.
 #include "engine/wccp_router_utils.h"
 
-#include <memory>
+#include <cstring>
 #include <string>
 #include <vector>
 
@@ -13,12 +13,8 @@
 
 namespace {
 
-struct RouterTest : testing::Test {
-    ~RouterTest() override {
-        wccp_g.seconds = 0;
-        shared.reset();
-        EXPECT_EQ(wccp_g.stat_allocs.load(), wccp_g.stat_frees.load());
-    }
+struct RouterTest : testing::Test, all_freed, reported_group {
+    RouterTest() : reported_group(false) { wccp_g.seconds = 0; }
     // The agreed codes as one number, forwarding first; minus one minus the result where there is no
     // agreement.
     int decide(uint32_t forwarding, uint32_t assignment, uint32_t ret) {
@@ -36,8 +32,6 @@ struct RouterTest : testing::Test {
         group->cfg_fwd_method = forwarding;
         group->cfg_assign_method = assignment;
     }
-    std::unique_ptr<reported_group> shared = std::make_unique<reported_group>(false);
-    wccp_service_group *group = shared->group;
 };
 
 TEST_F(RouterTest, EachMethodIsAgreedByItsOwnRule) {
@@ -87,7 +81,7 @@ TEST_F(RouterTest, RefusalsAndRoutersAreToldInTheLog) {
     wccp_create_sending_router(group, {}, &agreed, &agreed);
     tells({"invalid router id in ICU. 0.0.0.0"});
     uint32_t buckets;
-    wccp_get_router_assignment(group, shared->router(ROUTER_A), host(3), &buckets);
+    wccp_get_router_assignment(group, router(ROUTER_A), host(3), &buckets);
     tells({"get router assign. failed. cannot find appliance 10.0.0.3 in router's view: 10.0.0.201"});
     wccp_g.seconds += 40;
     wccp_monitor_sending_routers(group);
@@ -98,7 +92,7 @@ TEST_F(RouterTest, WhatTheFirstRouterAgreedHoldsForAll) {
     configure(WCCP_METHOD_EITHER, WCCP_ASSIGN_EITHER);
     EXPECT_EQ(decide(3, 3, 3), 221);
     EXPECT_EQ(decide(1, 3, 3), 111);
-    shared->router(ROUTER_A); // L2, hash, L2
+    router(ROUTER_A); // L2, hash, L2
     EXPECT_EQ(group->fwd_method * 100 + group->assign_method * 10 + group->ret_method, 212u);
     EXPECT_EQ(decide(1, 3, 3), -1);
     EXPECT_EQ(decide(2, 2, 3), -1);
@@ -141,7 +135,7 @@ TEST_F(RouterTest, ANewRouterIsOneWayAndKeepsItsOffer) {
 
 TEST_F(RouterTest, SilenceCountsAcrossTheWrapOfTheClock) {
     wccp_g.seconds = 0xfffffff0;
-    shared->router(ROUTER_A);
+    router(ROUTER_A);
     wccp_g.seconds += 39;
     wccp_monitor_sending_routers(group);
     EXPECT_EQ(group->sending_router_count, 1u);
@@ -152,16 +146,16 @@ TEST_F(RouterTest, SilenceCountsAcrossTheWrapOfTheClock) {
 
 TEST_F(RouterTest, ARemovalTakesItsMentionsItsShareAndLastTheAgreement) {
     for (const be32 id : {ROUTER_A, ROUTER_B, ROUTER_C})
-        shared->see(id, {id, ROUTER_A}, {{US, 100}, {id, 100}});
-    shared->router(ROUTER_A)->self_buckets = 10;
-    shared->router(ROUTER_B)->self_buckets = 10;
+        see(id, {id, ROUTER_A}, {{US, 100}, {id, 100}});
+    router(ROUTER_A)->self_buckets = 10;
+    router(ROUTER_B)->self_buckets = 10;
     group->redirecting_routers = 2;
     wccp_appliance_state_active(group);
     const uint32_t change_number = group->change_number;
 
     wccp_g.seconds = 40;
-    shared->router(ROUTER_B)->last_icu_time = 20;
-    shared->router(ROUTER_C)->last_icu_time = 40;
+    router(ROUTER_B)->last_icu_time = 20;
+    router(ROUTER_C)->last_icu_time = 40;
     wccp_monitor_sending_routers(group);
     EXPECT_EQ(group->sending_router_count, 2u);
     EXPECT_EQ(group->change_number, change_number + 1);
@@ -173,7 +167,7 @@ TEST_F(RouterTest, ARemovalTakesItsMentionsItsShareAndLastTheAgreement) {
     EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ADJACENCY);
 
     wccp_g.seconds = 60;
-    shared->router(ROUTER_C)->last_icu_time = 60;
+    router(ROUTER_C)->last_icu_time = 60;
     wccp_monitor_sending_routers(group); // the last one that redirected here
     EXPECT_EQ(group->redirecting_routers, 0);
     EXPECT_TRUE(group->state_flags & WCCP_STATE_INIT);
@@ -189,20 +183,21 @@ TEST_F(RouterTest, ARemovalTakesItsMentionsItsShareAndLastTheAgreement) {
 }
 
 TEST_F(RouterTest, QueriesAreAnsweredToTwoWayRoutersAndAFloodIsBounded) {
-    shared->router(ROUTER_A);
+    router(ROUTER_A);
     EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_B, host(77)), 0); // not known
     EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_A, host(77)), 0); // one-way
     EXPECT_EQ(group->removal_reply_count, 0u);
-    EXPECT_TRUE(is_zero(shared->router(ROUTER_A)->receive_id));
+    EXPECT_TRUE(is_zero(router(ROUTER_A)->receive_id));
 
-    shared->see(ROUTER_A, {ROUTER_A}, {{US, 100}});
+    see(ROUTER_A, {ROUTER_A}, {{US, 100}});
     EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_A, host(77)), 0);
-    EXPECT_EQ(shared->router(ROUTER_A)->receive_id, host(77));
+    EXPECT_EQ(router(ROUTER_A)->receive_id, host(77));
     ASSERT_EQ(group->removal_reply_count, 1u);
     const wccp_pkt *pkt = &group->removal_replies->pkt;
     EXPECT_EQ(pkt->ipa, ROUTER_A);
+    EXPECT_NE(memmem(pkt->data, pkt->length, host(77).bytes, 4), nullptr) << "the query's receive id";
     const std::vector<uint8_t> written(pkt->data, pkt->data + pkt->length);
-    shared->see(ROUTER_A, {ROUTER_A, ROUTER_B}, {{US, 100}}); // and is not written again
+    see(ROUTER_A, {ROUTER_A, ROUTER_B}, {{US, 100}}); // and is not written again
     int answered = 1;
     for (int query = 1; query < 1000; query++)
         answered += wccp_process_router_removal_query(group, ROUTER_A, host(78)) == 0;
@@ -223,15 +218,15 @@ TEST_F(RouterTest, QuestionsAboutRouters) {
     EXPECT_EQ(wccp_get_router_connection_stats(group, &one_way, nullptr), 1);
     EXPECT_EQ(wccp_get_router_connection_stats(group, &one_way, &two_way), 0);
     EXPECT_EQ(one_way + two_way, 0u);
-    shared->router(ROUTER_A)->flags = WCCP_RTR_ONE_WAY | WCCP_RTR_TWO_WAY;
-    shared->router(ROUTER_B);
-    shared->router(ROUTER_C)->flags = 0;
+    router(ROUTER_A)->flags = WCCP_RTR_ONE_WAY | WCCP_RTR_TWO_WAY;
+    router(ROUTER_B);
+    router(ROUTER_C)->flags = 0;
     wccp_get_router_connection_stats(group, &one_way, &two_way);
     EXPECT_EQ(one_way, 1u);
     EXPECT_EQ(two_way, 1u);
 
-    wccp_sending_router *a = shared->router(ROUTER_A);
-    shared->report(ROUTER_A, {{US, 100}, {host(2), 100}});
+    wccp_sending_router *a = router(ROUTER_A);
+    report(ROUTER_A, {{US, 100}, {host(2), 100}});
     a->view_appliances[0].buckets_assigned = 5;
     EXPECT_EQ(wccp_get_router_assignment(group, a, US, &buckets), 0);
     EXPECT_EQ(buckets, 5u);
@@ -239,7 +234,7 @@ TEST_F(RouterTest, QuestionsAboutRouters) {
     EXPECT_EQ(buckets, 0u);
     EXPECT_EQ(wccp_get_router_assignment(group, a, US, nullptr), 1);
 
-    const wccp_sending_router *b = shared->router(ROUTER_B);
+    const wccp_sending_router *b = router(ROUTER_B);
     EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, b), 0);
     a->view_appliances[1].buckets_assigned = 5;
     EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, b), 1);

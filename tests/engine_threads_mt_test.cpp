@@ -364,37 +364,4 @@ TEST_F(Threads, AddressesChangeAThousandTimesUnderTheReceivers) {
     EXPECT_TRUE(soon([&] { return icus_of(61) > seen[0] && icus_of(62) > seen[1]; }));
 }
 
-// Last, since the library's thread stays for good: the engine's own start, real notifications, and its end.
-TEST_F(Threads, ZTheWholeEngineFollowsTheKernel) {
-    tunneld.reset();
-    write_mem_conf(); // the engine starts here as a process of its own
-    ASSERT_EQ(wccp_init_mgr(), 0);
-    tunneld.emplace(tunneld_does);
-    ASSERT_EQ(wccp_g.primary_if, wccp_if_find_interface("wan0"));
-    wccp_service_group *group = add_group(61, "wan0");
-    const auto locked = [](auto condition) {
-        return soon([&] {
-            const wccp_engine_lock lock;
-            return condition();
-        });
-    };
-    EXPECT_TRUE(locked([] { return wccp_g.seconds >= 1; }));
-    run_command("ip link set wan0 down");
-    EXPECT_TRUE(locked([&] { return wccp_g.primary_if->link_up == 0 && !group->hia_timer.active; }));
-    run_command("ip link set wan0 up");
-    EXPECT_TRUE(locked([&] { return wccp_g.primary_if->ready_flags == 3 && group->hia_timer.active; }));
-    run_command("ip addr del 10.1.0.1/24 dev wan0");
-    EXPECT_TRUE(locked([&] { return is_zero(group->appliance_ipa) && !group->hia_timer.active; }));
-    run_command("ip addr add 10.1.0.7/24 dev wan0");
-    EXPECT_TRUE(locked([&] { return group->appliance_ipa == ipa("10.1.0.7") && group->hia_timer.active; }));
-    const uint32_t sent = group->tx_here_i_am;
-    EXPECT_TRUE(locked([&] { return group->tx_here_i_am > sent; })) << "at the next tick";
-
-    wccpd_exiting = 1;
-    EXPECT_EQ(wccp_exit_mgr(), 0);
-    run_command("ip addr add 10.1.0.8/24 dev wan0");
-    EXPECT_EQ(threads_named("WCCP_"), 0);
-    EXPECT_TRUE(lock_is_free());
-}
-
 } // namespace
