@@ -16,17 +16,14 @@
 
 #include <algorithm>
 #include <chrono>
-#include <cstdio>
+#include <cstdlib>
 #include <optional>
 #include <thread>
 
-#include <nlohmann/json.hpp>
-
 #include "mgmt/bnode_types.h"
+#include "platform/mgmtctl/render.h"
 #include "platform/schema.h"
 #include "runtime/common.h"
-
-using json = nlohmann::ordered_json;
 
 static const char *const GROUPS = "/qv/wccpd/wccp/srv_grp/config";
 static const char *const POLICIES = "/qv/wccpd/wccp/policy_grp/config";
@@ -168,6 +165,8 @@ static std::string parse_wish(const std::vector<std::string> &words, wanted_grou
         if (std::string(word->node) == "router") {
             if (!out->routers)
                 out->routers.emplace();
+            if (std::find(out->routers->begin(), out->routers->end(), value) != out->routers->end())
+                return "router " + value + " is given twice";
             if (!nothing)
                 out->routers->push_back(value);
         } else if (!out->values.emplace(word->node, nothing ? std::nullopt : std::optional(value)).second) {
@@ -515,23 +514,23 @@ group_result policy_command(const group_link &link, const std::vector<std::strin
 
 // --- Telling it
 
-static json as_json(const group_result &result) {
-    json out = {{result.kind == "group" ? "group" : "policy",
-                 result.number < 0 ? json(nullptr) : json(result.number)},
-                {"done", result.done.empty() ? "nothing" : result.done},
-                {"commits", result.commits}};
+static ctl_json as_json(const group_result &result) {
+    ctl_json out = {{result.kind == "group" ? "group" : "policy",
+                     result.number < 0 ? ctl_json(nullptr) : ctl_json(result.number)},
+                    {"done", result.done.empty() ? "nothing" : result.done},
+                    {"commits", result.commits}};
     if (!result.wccpd.empty()) {
         out["wccpd"] = result.wccpd;
         out["running"] = result.runs;
-        out["state"] = result.state.empty() ? json(nullptr) : json(result.state);
+        out["state"] = result.state.empty() ? ctl_json(nullptr) : ctl_json(result.state);
         out["designated"] = result.designated;
-    }
-    if (!result.error.empty()) {
-        out["error"] = result.error;
-        out["code"] = result.code;
     }
     if (!result.note.empty())
         out["note"] = result.note;
+    if (result.exit == CTL_OK)
+        return out;
+    out["error"] = result.error;
+    out["code"] = result.code;
     out["exit"] = result.exit;
     return out;
 }
@@ -559,34 +558,31 @@ static std::string as_text(const group_result &result) {
 
 static int tell(const ctl_options &options, const group_result &result) {
     if (options.json)
-        printf("%s\n", as_json(result).dump(-1, ' ', true, json::error_handler_t::replace).c_str());
+        put(json_line(as_json(result)));
     else if (result.exit == CTL_OK)
-        printf("%s\n", as_text(result).c_str());
-    if (result.exit != CTL_OK && !options.json) {
-        const std::string about =
-            result.number < 0 ? "" : result.kind + " " + std::to_string(result.number) + ": ";
-        fprintf(stderr, "mgmtctl: %s%s\n", about.c_str(), result.error.c_str());
-        if (!result.note.empty())
-            fprintf(stderr, "mgmtctl: %s%s\n", about.c_str(), result.note.c_str());
-    }
+        put(as_text(result) + "\n");
+    else
+        return tell_failure(
+            options, {result.exit, result.number < 0 ? "" : result.kind + " " + std::to_string(result.number),
+                      result.error, result.note, result.code});
     return result.exit;
 }
 
 static int list_words(const ctl_options &options) {
-    json all = json::array();
+    ctl_json all = ctl_json::array();
     for (const group_word &word : group_words()) {
         const char *fallback = fallback_of(word);
         if (!options.json)
-            printf("%-16s %s%s%s\n", word.word, values_of(word).c_str(),
-                   fallback && *fallback ? "; default " : "", fallback ? fallback : "");
+            put(word.word + std::string(17 - std::string(word.word).size(), ' ') + values_of(word) +
+                (fallback && *fallback ? std::string("; default ") + fallback : "") + "\n");
         all.push_back({{"word", word.word},
                        {"node", word.node},
                        {"values", values_of(word)},
-                       {"default", fallback ? json(fallback) : json(nullptr)},
+                       {"default", fallback ? ctl_json(fallback) : ctl_json(nullptr)},
                        {"recreates", word.whole}});
     }
     if (options.json)
-        printf("%s\n", all.dump().c_str());
+        put(json_line(all));
     return CTL_OK;
 }
 
@@ -596,7 +592,7 @@ static group_result list_roots(const ctl_options &options, const group_link &lin
     group_result result;
     result.kind = kind;
     ctl_reply reply;
-    json all = json::array();
+    ctl_json all = ctl_json::array();
     if (!ask(link, ctl_walk::children, above, &reply, &result))
         return result;
     for (const ctl_binding &binding : reply.bindings) {
@@ -605,23 +601,24 @@ static group_result list_roots(const ctl_options &options, const group_link &lin
         if (!read_group(link, binding.name, &nodes, &result))
             return result;
         std::string line = number;
-        json one = {{"number", std::atol(number.c_str())}, {"routers", routers_of(nodes)}};
+        ctl_json one = {{"number", std::atol(number.c_str())}, {"routers", routers_of(nodes)}};
         for (const std::string &router : routers_of(nodes))
             line += " router " + router;
         for (const auto &[name, value] : nodes) {
             if (name.starts_with("router/"))
                 continue;
             const group_word *word = find_word(name);
-            const std::string shown = name == "password" ? "********" : quoted(value);
-            line += std::string(" ") + (word ? word->word : name.c_str()) + " " + shown;
-            one[word ? word->word : name] = name == "password" ? shown : value;
+            const bool hidden = name == "password" && !options.secrets;
+            line += std::string(" ") + (word ? word->word : name.c_str()) + " " +
+                    (hidden ? "********" : quoted(value));
+            one[word ? word->word : name] = hidden ? "********" : value;
         }
         if (!options.json)
-            printf("%s\n", line.c_str());
+            put(line + "\n");
         all.push_back(one);
     }
     if (options.json)
-        printf("%s\n", all.dump(-1, ' ', true, json::error_handler_t::replace).c_str());
+        put(json_line(all));
     return result;
 }
 

@@ -101,7 +101,7 @@ std::string draw_json(const picture &shown) {
     out["alarms"] = json::array();
     for (const picture_alarm &alarm : shown.alarms)
         out["alarms"].push_back({{"type", alarm.type},
-                                 {"kind", alarm.kind},
+                                 {"name", alarm.name},
                                  {"group", number_or_null(alarm.group)},
                                  {"source", alarm.source},
                                  {"text", alarm.text},

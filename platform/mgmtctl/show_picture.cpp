@@ -12,11 +12,13 @@
 #include <algorithm>
 #include <charconv>
 
+#include <arpa/inet.h>
+
+#include "platform/mgmtctl/render.h"
 #include "runtime/common.h"
 
 static const char *const CONFIGS = "/qv/wccpd/wccp/srv_grp/config";
 static const char *const STATES = "/qv/wccpd/wccp/srv_grp/state";
-static const char *const ALARMS = "/qv/alarms/state/raised";
 static const char *const ROLES = "/qv/alarms/state/role";
 
 static constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
@@ -196,6 +198,11 @@ static void take_load(picture_group *group, picture_router *router, const std::s
     one->reported = true;
 }
 
+static uint32_t address_order(const std::string &address) {
+    in_addr parsed = {};
+    return inet_pton(AF_INET, address.c_str(), &parsed) == 1 ? ntohl(parsed.s_addr) : 0;
+}
+
 static bool gather_routers(gathering *work, picture_group *group,
                            const std::vector<std::string> &configured) {
     ctl_reply reply;
@@ -218,6 +225,10 @@ static bool gather_routers(gathering *work, picture_group *group,
         else if (parts[3] == "load_dist")
             take_load(group, &group->routers.back(), parts[2], binding.value);
     }
+    // wccpd's numbers change with each that comes or goes; a place on the screen shouldn't.
+    std::sort(group->routers.begin(), group->routers.end(), [](const auto &a, const auto &b) {
+        return address_order(a.address) < address_order(b.address);
+    });
     for (const std::string &address : configured) {
         const auto heard = std::find_if(group->routers.begin(), group->routers.end(),
                                         [&](const picture_router &r) { return r.address == address; });
@@ -312,36 +323,17 @@ static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
 
 static bool gather_alarms(gathering *work) {
     ctl_reply reply;
-    if (!work->ask(ctl_walk::subtree, ALARMS, &reply))
+    if (!work->ask(ctl_walk::subtree, ALARM_ROOT, &reply))
         return false;
-    std::string type, source;
-    for (const ctl_binding &binding : reply.bindings) {
-        const std::vector<std::string> parts = parts_below(ALARMS, binding.name);
-        if (parts.size() != 2 && parts.size() != 3)
-            continue;
-        if (work->shown.alarms_total == 0 || parts[0] != type || parts[1] != source) {
-            type = parts[0];
-            source = parts[1];
-            work->shown.alarms_total++;
-            if (work->shown.alarms_total > work->limits.alarms)
-                continue;
-            picture_alarm *alarm = &work->shown.alarms.emplace_back();
-            alarm->type = number_of<long>(type, 0);
-            alarm->source = clean_text(source, 63);
-            if (const size_t at = source.rfind(":grp:"); at != std::string::npos)
-                alarm->group = number_of(source.substr(at + 5), -1);
-        }
-        if (work->shown.alarms_total > work->limits.alarms)
-            continue;
-        static const node_row<picture_alarm> rows[] = {
-            {"name", [](picture_alarm *a, const std::string &v) { a->kind = clean_text(v, 31); }},
-            {"since", [](picture_alarm *a, const std::string &v) { a->since = clean_text(v, 31); }},
-            {"reporter", [](picture_alarm *a, const std::string &v) { a->reporter = clean_text(v, 63); }},
-        };
-        if (parts.size() == 2)
-            work->shown.alarms.back().text = clean_text(binding.value, 127);
-        else
-            take_node(rows, parts[2], binding.value, &work->shown.alarms.back());
+    const std::vector<ctl_alarm> standing = alarms_of(reply.bindings);
+    work->shown.alarms_total = standing.size();
+    for (size_t i = 0; i < std::min(standing.size(), work->limits.alarms); i++) {
+        const ctl_alarm &from = standing[i];
+        const size_t at = from.source.rfind(":grp:");
+        work->shown.alarms.push_back(
+            {number_of<long>(from.type, 0), clean_text(from.name, 31), clean_text(from.source, 63),
+             clean_text(from.text, 127), clean_text(from.since, 31), clean_text(from.reporter, 63),
+             at == std::string::npos ? -1 : number_of(from.source.substr(at + 5), -1)});
     }
     if (!work->ask(ctl_walk::children, ROLES, &reply))
         return false;

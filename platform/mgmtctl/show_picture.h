@@ -38,7 +38,7 @@ struct picture_table {
 };
 struct picture_alarm {
     long type = 0;
-    std::string kind; // "adjacency", "assignment"
+    std::string name; // "adjacency", "assignment"
     std::string source, text, since, reporter;
     int group = -1;
 };

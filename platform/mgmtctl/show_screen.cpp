@@ -25,15 +25,12 @@ struct pen {
     const screen_form &form;
     std::string out;
     int used = 0;
-    bool styled = false;
 };
 } // namespace
 
 static void set_style(pen *line, const std::string &codes) {
-    if (!line->form.colour)
-        return;
-    line->out += "\033[" + codes + "m";
-    line->styled = codes != "0";
+    if (line->form.colour)
+        line->out += "\033[" + codes + "m";
 }
 
 // One column wide each; `text` is ASCII.
@@ -42,11 +39,12 @@ static void add_cells(pen *line, const std::string &text, style how = style::pla
     const char *code = codes[static_cast<int>(how)];
     const auto room = static_cast<size_t>(std::max(line->form.columns - line->used, 0));
     const std::string shown = text.substr(0, room);
-    if (*code)
+    const bool styled = *code && !shown.empty();
+    if (styled)
         set_style(line, code);
     line->out += shown;
     line->used += static_cast<int>(shown.size());
-    if (*code)
+    if (styled)
         set_style(line, "0");
 }
 
@@ -94,14 +92,14 @@ static std::string plural(size_t count, const char *what) {
 
 static std::string alarm_words(const picture_alarm &alarm) {
     static const struct {
-        const char *kind, *words;
+        const char *name, *words;
     } known[] = {
         {"adjacency", "a router is not connected as it should be"},
         {"assignment", "a router does not share out the traffic as asked"},
     };
     std::string text = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": " : alarm.source + ": ";
     const auto *row = std::find_if(std::begin(known), std::end(known),
-                                   [&](const auto &each) { return alarm.kind == each.kind; });
+                                   [&](const auto &each) { return alarm.name == each.name; });
     text += row != std::end(known) ? row->words : alarm.text;
     return alarm.since.empty() ? text : text + ", since " + alarm.since;
 }
@@ -180,7 +178,7 @@ struct screen {
     const screen_form &form;
     std::vector<std::string> lines;
 
-    pen begin() const { return {form, "", 0, false}; }
+    pen begin() const { return {form, "", 0}; }
     void end(pen *line) { lines.push_back(std::move(line->out)); }
     void text(const std::string &words, style how = style::plain) {
         pen line = begin();
@@ -244,19 +242,19 @@ static void draw_group_head(screen *on, const picture_group &group) {
         add_cells(&line, " !", style::bad);
     std::string text;
     if (group.uptime_ms)
-        text += "   up " + duration_text(group.uptime_ms);
+        text += "  up " + duration_text(group.uptime_ms);
     if (!group.address.empty() && group.address != "0.0.0.0")
-        text += "   " + group.address + (group.interface.empty() ? "" : " on " + group.interface);
+        text += "  " + group.address + (group.interface.empty() ? "" : " on " + group.interface);
     else if (!group.interface.empty())
-        text += "   on " + group.interface;
+        text += "  on " + group.interface;
     if (!group.protocol.empty())
-        text += "   " + group.protocol;
+        text += "  " + group.protocol;
     if (group.weight >= 0)
-        text += format("   weight %" PRId64, group.weight);
-    if (group.policy >= 0)
-        text += format("   policy %" PRId64, group.policy);
+        text += format("  weight %" PRId64, group.weight);
     if (group.authenticated)
-        text += "   password";
+        text += "  md5";
+    if (group.policy >= 0)
+        text += format("  policy %" PRId64, group.policy);
     add_cells(&line, text);
     on->end(&line);
 }
@@ -264,13 +262,13 @@ static void draw_group_head(screen *on, const picture_group &group) {
 static void draw_router(screen *on, const picture_router &router) {
     const auto method = [](const std::string &word) { return word.empty() ? "-" : word.c_str(); };
     pen line = on->begin();
-    add_cells(&line, format("  router %-15s  ", router.address.c_str()));
+    add_cells(&line, format("  router %-15s ", router.address.c_str()));
     if (router.connection == "none") {
         add_cells(&line, "nothing heard", style::bad);
     } else {
         add_cells(&line, format("%-7s", router.connection.c_str()),
                   router.connection == "two-way" ? style::good : style::warn);
-        add_cells(&line, format("  %10s  forward %-4s assign %-5s return %-3s",
+        add_cells(&line, format("  %8s  fwd %-3s  assign %-4s  return %-3s",
                                 duration_text(router.connected_ms).c_str(), method(router.forward),
                                 method(router.assign), method(router.back)));
         if (router.id != router.address)

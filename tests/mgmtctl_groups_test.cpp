@@ -1,0 +1,134 @@
+// The words of "mgmtctl group", and what becomes of a change of two commits that stops in between. What
+// mgmtd and wccpd make of them is looked at in tests/scenario_mgmtctl_groups.sh.
+#include <gtest/gtest.h>
+
+#include <map>
+
+#include "platform/mgmtctl/groups.h"
+#include "runtime/common.h"
+
+namespace {
+const std::string ROOT = "/qv/wccpd/wccp/srv_grp/config/51";
+
+struct fake {
+    std::map<std::string, std::string> nodes = {{ROOT, "51"},
+                                                {ROOT + "/interface", "eth0"},
+                                                {ROOT + "/password", "a 'b"},
+                                                {ROOT + "/router/1", "1"},
+                                                {ROOT + "/router/1/ipaddr", "10.0.0.1"},
+                                                {ROOT + "/weight", "100"}}; // its default
+    std::vector<std::vector<ctl_change_item>> commits;                      // that were sent
+    std::vector<uint32_t> codes;                                            // of the answers, 1: none comes
+
+    group_result run(const std::vector<std::string> &words) {
+        commits.clear();
+        group_link link;
+        link.settle_ms = 0;
+        link.query = [this](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *) {
+            if (name.find("/state") != std::string::npos)
+                out->code = LC_IO_CLOSED;
+            for (const auto &[node, value] : nodes)
+                if (node == name || (walk == ctl_walk::subtree && node.starts_with(name + "/")))
+                    out->bindings.push_back({node, "string", value});
+            return true;
+        };
+        link.set = [this](const std::vector<ctl_change_item> &items, ctl_reply *out,
+                          std::string *out_reason) {
+            commits.push_back(items);
+            const bool trial = items.back().binding.name.ends_with("/trial");
+            out->code = trial                            ? uint32_t{LC_NOT_FOUND}
+                        : commits.size() <= codes.size() ? codes[commits.size() - 1]
+                                                         : 0;
+            out->message = trial ? items.back().binding.name + ": there is no such node" : "not like that";
+            *out_reason = "mgmtd closed the session";
+            return out->code != 1;
+        };
+        return group_command(link, words);
+    }
+    std::string sent(size_t commit) const {
+        static const char *const kinds[] = {"create", "modify", "remove", "reset"};
+        std::string out;
+        for (const ctl_change_item &item : commits.at(commit))
+            out += std::string(kinds[static_cast<int>(item.change)]) + " " +
+                   item.binding.name.substr(ROOT.size()) + "=" + item.binding.value + ";";
+        return out;
+    }
+};
+const std::vector<std::string> NEW_ROUTER = {"set", "51", "router", "10.0.0.2", "weight", "7"};
+} // namespace
+
+TEST(Groups, WrongWordsChangeNothingAndAreTold) {
+    const struct {
+        std::vector<std::string> words;
+        int exit;
+        const char *told;
+    } cases[] = {
+        {{"add", "52", "wieght", "7"}, CTL_USAGE, "did you mean \"weight\"?"},
+        {{"add", "52", "interf", "eth0"}, CTL_USAGE, "did you mean \"interface\"?"},
+        {{"add", "52", "zzzzzzzz", "7"}, CTL_USAGE, "known are"},
+        {{"ad", "52"}, CTL_USAGE, "did you mean \"add\"?"},
+        {{"add", "5x"}, CTL_USAGE, "group add N"},
+        {{"add", "52", "weight"}, CTL_USAGE, "needs a value: 0 to 65535"},
+        {{"add", "52", "weight", "1", "weight", "2"}, CTL_USAGE, "given twice"},
+        {{"set", "51", "router", "10.0.0.1", "router", "10.0.0.1"}, CTL_USAGE, "given twice"},
+        {{"add", "51"}, CTL_REFUSED, "there is a group 51"},
+        {{"set", "52", "weight", "1"}, CTL_NOT_FOUND, "there is no group 52"},
+    };
+    for (const auto &one : cases) {
+        fake mgmtd;
+        const group_result result = mgmtd.run(one.words);
+        EXPECT_EQ(result.exit, one.exit) << one.told;
+        EXPECT_NE(result.error.find(one.told), std::string::npos) << result.error;
+        EXPECT_TRUE(mgmtd.commits.empty()) << one.told;
+    }
+}
+
+TEST(Groups, OneCommitWhereARunningGroupFollows) {
+    fake mgmtd;
+    EXPECT_EQ(mgmtd.run({"set", "51", "weight", "100", "router", "10.0.0.1", "hash-src-ip", "default"}).done,
+              "unchanged");
+    EXPECT_TRUE(mgmtd.commits.empty());
+    EXPECT_EQ(mgmtd.run({"set", "51", "weight", "7", "password", "default", "policy", "5"}).done, "changed");
+    ASSERT_EQ(mgmtd.commits.size(), 1u);
+    EXPECT_EQ(mgmtd.sent(0), "modify /password=default;modify /policy_grp=5;modify /weight=7;");
+    mgmtd.nodes[ROOT + "/weight"] = "7";
+    EXPECT_EQ(mgmtd.run({"set", "51", "weight", "default"}).commits, 1);
+    EXPECT_EQ(mgmtd.sent(0), "reset /weight=;");
+}
+
+TEST(Groups, AGroupThatIsCreatedAgainKeepsWhatWasSet) {
+    fake mgmtd;
+    const std::string before =
+        "create =51;create /interface=eth0;create /password=a 'b;create /router/1/ipaddr=10.0.0.1;";
+    EXPECT_EQ(mgmtd.run(NEW_ROUTER).done, "recreated");
+    ASSERT_EQ(mgmtd.commits.size(), 3u); // the first can only be refused
+    EXPECT_EQ(mgmtd.sent(1), "remove =;");
+    EXPECT_EQ(mgmtd.sent(2), "create =51;create /interface=eth0;create /password=a 'b;create "
+                             "/router/1/ipaddr=10.0.0.2;create /weight=7;");
+    EXPECT_EQ(mgmtd.run({"set", "51", "interface", "none"}).done, "recreated");
+    mgmtd.nodes[ROOT + "/policy_grp"] = "5";
+    EXPECT_EQ(mgmtd.run({"set", "51", "policy", "none"}).done, "recreated");
+    EXPECT_EQ(mgmtd.sent(2), before);
+
+    mgmtd.nodes.erase(ROOT + "/policy_grp");
+    mgmtd.codes = {0, LC_IO_ERROR};
+    group_result result = mgmtd.run(NEW_ROUTER);
+    EXPECT_EQ(result.exit, CTL_REFUSED);
+    EXPECT_EQ(result.commits, 0);
+
+    mgmtd.codes = {0, 0, LC_ASSERTION};
+    result = mgmtd.run(NEW_ROUTER);
+    EXPECT_EQ(result.exit, CTL_REFUSED);
+    EXPECT_EQ(result.done, "restored");
+    EXPECT_EQ(mgmtd.sent(3), before);
+
+    for (const std::vector<uint32_t> &codes :
+         {std::vector<uint32_t>{0, 0, 1}, {0, 0, LC_IO_ERROR, LC_IO_ERROR}}) {
+        mgmtd.codes = codes;
+        result = mgmtd.run(NEW_ROUTER);
+        EXPECT_EQ(result.exit, CTL_PARTLY);
+        EXPECT_NE(result.note.find("mgmtctl group add 51 router 10.0.0.1 interface eth0 password 'a '\\''b'"),
+                  std::string::npos)
+            << result.note;
+    }
+}

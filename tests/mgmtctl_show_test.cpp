@@ -1,0 +1,314 @@
+// The picture of "mgmtctl show": gathered from canned nodes, drawn for a terminal and as JSON, within bounds.
+#include <gtest/gtest.h>
+
+#include <functional>
+#include <map>
+
+#include <nlohmann/json.hpp>
+
+#include "platform/mgmtctl/show_picture.h"
+#include "runtime/common.h"
+
+using json = nlohmann::json;
+
+namespace {
+const std::string CONFIG = "/qv/wccpd/wccp/srv_grp/config/", STATE = "/qv/wccpd/wccp/srv_grp/state/";
+const std::string ALARM = "/qv/alarms/state/raised/196638/eth0:grp:51";
+
+// Answers like mgmtd and wccpd: a walk of appliances finds none, their numbers are asked for.
+struct canned {
+    std::vector<ctl_binding> nodes; // in the order of their names
+    uint32_t wccpd_code = 0;
+    size_t asked = 0, lost_after = SIZE_MAX;
+
+    void add(const std::string &name, const std::string &value) { nodes.push_back({name, "string", value}); }
+
+    bool answer(ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
+        if (asked++ >= lost_after) {
+            *out_reason = "mgmtd closed the session";
+            return false;
+        }
+        if (name.find("/state") != std::string::npos && name.starts_with("/qv/wccpd"))
+            out->code = wccpd_code;
+        if (out->code != 0)
+            return true;
+        for (const ctl_binding &node : nodes) {
+            const bool below = node.name.starts_with(name + "/");
+            const bool child = below && node.name.find('/', name.size() + 1) == std::string::npos;
+            if (walk == ctl_walk::node ? node.name == name : walk == ctl_walk::children ? child : below)
+                out->bindings.push_back(node);
+        }
+        return true;
+    }
+    picture gather(const picture_limits &limits = {}) {
+        asked = 0;
+        return gather_picture([this](ctl_walk walk, const std::string &name, ctl_reply *out,
+                                     std::string *out_reason) { return answer(walk, name, out, out_reason); },
+                              limits);
+    }
+};
+
+// Of a router: the first 64 buckets are A's, the others B's; the words as the engine has them.
+std::string hash_rows(const std::string &router) {
+    const std::string head = "\tRouter id                  : " + router + "\n\tAppliance ip               : ";
+    const std::string all = "0xffffffff ffffffff ffffffff ffffffff\n",
+                      none = "0x00000000 00000000 00000000 00000000\n";
+    return head +
+           "10.0.0.101\n\tWeight                     : 25\n\tRxed hash assignment       : 0xffffffff "
+           "ffffffff "
+           "00000000 00000000\n\t                           : " +
+           none + "\n" + head +
+           "10.0.0.102\n\tWeight                     : 75\n\tRxed hash assignment       : 0x00000000 "
+           "00000000 "
+           "ffffffff ffffffff\n\t                           : " +
+           all + "\n";
+}
+
+canned one_group() {
+    canned from;
+    for (const auto &[node, value] : std::map<std::string, std::string>{{"", "51"},
+                                                                        {"/interface", "eth0"},
+                                                                        {"/weight", "25"},
+                                                                        {"/password", "secret"},
+                                                                        {"/protocol", "tcp"},
+                                                                        {"/router/1/ipaddr", "10.0.0.1"},
+                                                                        {"/router/2/ipaddr", "10.0.0.2"},
+                                                                        {"/router/3/ipaddr", "10.0.0.3"}})
+        from.add(CONFIG + "51" + node, value);
+    from.add("/qv/wccpd/system/state/is_alive", "Ready");
+    from.add(STATE + "51", "51");
+    from.add(STATE + "51/oper", "ACTIVE, DESIGNATED");
+    from.add(STATE + "51/uptime", "3723000");
+    from.add(STATE + "51/app_id", "10.0.0.101");
+    from.add(STATE + "51/num_appliances", "2");
+    from.add(STATE + "51/debug", "    WCCP interfaces                  : # 1 eth0\n"
+                                 "    WCCP interface ipa and link      : 10.0.0.101 up \n");
+    from.add(STATE + "51/assignment", "\n\tDesignator allocation     \n\tActive appliances          : "
+                                      "2\n\tAppliance ip               : 10.0.0.101\n"
+                                      "\tHash/mask allotment        : 30 % \n\t                           : "
+                                      "0x00000000 00000000 00000000 00000000\n"
+                                      "\tReceived router allocation\n" +
+                                          hash_rows("10.0.0.2") + hash_rows("10.0.0.1"));
+    for (const char *router : {"1", "2"}) {
+        const std::string root = STATE + "51/router/" + router;
+        const std::string address = *router == '1' ? "10.0.0.2" : "10.0.0.1";
+        for (const auto &[node, value] : std::map<std::string, std::string>{
+                 {"", router},
+                 {"/state", *router == '1' ? "ONE-WAY connected" : "TWO-WAY connected"},
+                 {"/fwd_method", "GRE"},
+                 {"/ret_method", "L2"},
+                 {"/assign_method", "not-set"},
+                 {"/id", address},
+                 {"/ipaddr", address},
+                 {"/conn_time", "60000"},
+                 {"/appliance/10.0.0.101", "10.0.0.101"},
+                 {"/appliance/10.0.0.101/load_dist", *router == '1' ? "20" : "25"},
+                 {"/appliance/10.0.0.102/load_dist", "75"}})
+            from.add(root + node, value);
+    }
+    from.add(STATE + "51/appliance/1/ipaddr", "10.0.0.101");
+    from.add(STATE + "51/appliance/1/weight", "25");
+    from.add(STATE + "51/appliance/2/ipaddr", "10.0.0.102");
+    from.add(STATE + "51/appliance/2/weight", "75");
+    from.add(ALARM, "WCCP GRP 51: alarm: raising\033]0;evil\a adjacency down alarm");
+    from.add(ALARM + "/name", "adjacency");
+    from.add(ALARM + "/since", "2026/11/25 00:10:11");
+    return from;
+}
+
+// 256 groups of 32 routers with 32 appliances each, made up as they are asked for.
+bool many(ctl_walk walk, const std::string &name, ctl_reply *out) {
+    const auto add = [&](const std::string &node, const std::string &value) {
+        out->bindings.push_back({node, "string", value});
+    };
+    if (walk == ctl_walk::children && (name + "/" == CONFIG || name + "/" == STATE))
+        for (int i = 0; i < 256; i++)
+            add(name + "/" + std::to_string(i), std::to_string(i));
+    else if (name.ends_with("/router"))
+        for (int r = 1; r <= 32; r++) {
+            const std::string root = name + "/" + std::to_string(r);
+            add(root + "/state", "TWO-WAY connected");
+            add(root + "/ipaddr", "10.0.1." + std::to_string(r));
+            for (int a = 1; a <= 40; a++)
+                add(root + "/appliance/10.0.2." + std::to_string(a) + "/load_dist", "3");
+        }
+    else if (walk == ctl_walk::children && name.starts_with(STATE)) {
+        add(name + "/oper", "ACTIVE");
+        add(name + "/num_appliances", "4000000000");
+    } else if (name.ends_with("/oper"))
+        add(name, "ACTIVE");
+    else if (name.find("/appliance/") != std::string::npos)
+        add(name,
+            name.ends_with("weight")
+                ? "1"
+                : "10.0.2." + name.substr(name.find("ance/") + 5, name.rfind('/') - name.find("ance/") - 5));
+    return true;
+}
+
+size_t columns_of(const std::string &line) {
+    size_t columns = 0;
+    for (size_t i = 0; i < line.size(); i++) {
+        if (line[i] == '\033')
+            i = line.find('m', i);
+        else
+            columns += (line[i] & 0xc0) != 0x80;
+    }
+    return columns;
+}
+
+std::string joined(const std::vector<std::string> &lines) {
+    std::string out;
+    for (const std::string &line : lines)
+        out += line + "\n";
+    return out;
+}
+} // namespace
+
+TEST(Show, TellsTheWholeOfAGroup) {
+    const picture shown = one_group().gather();
+    const json all = json::parse(draw_json(shown));
+    EXPECT_EQ(all["wccpd"], "running");
+    EXPECT_EQ(all["status"], "Ready");
+    const json group = all["groups"][0];
+    EXPECT_EQ(group["state"], "ACTIVE");
+    EXPECT_EQ(group["designated"], true);
+    EXPECT_EQ(group["uptime_ms"], 3723000);
+    EXPECT_EQ(group["password"], true);
+    EXPECT_EQ(group["link"], "up");
+    ASSERT_EQ(group["routers"].size(), 3u);
+    const json first = group["routers"][0];
+    EXPECT_EQ(first["address"], "10.0.0.1");
+    EXPECT_EQ(first["connection"], "two-way");
+    EXPECT_EQ(first["forward"], "gre");
+    EXPECT_EQ(first["return"], "l2");
+    EXPECT_EQ(first["assign"], nullptr);
+    EXPECT_EQ(first["shares"]["10.0.0.102"], 75);
+    EXPECT_EQ(group["routers"][1]["connection"], "one-way");
+    EXPECT_EQ(group["routers"][2]["connection"], "none");
+    const json self = group["appliances"][0];
+    EXPECT_EQ(self["self"], true);
+    EXPECT_EQ(self["weight"], 25);
+    EXPECT_EQ(self["asked_percent"], 30); // the designated appliance knows better than the weights
+    EXPECT_EQ(self["share_percent"], 20);
+    EXPECT_EQ(self["share_percent_most"], 25);
+    EXPECT_EQ(group["appliances"][1]["asked_percent"], nullptr);
+    const json table = group["tables"][0];
+    EXPECT_EQ(group["tables"].size(), 1u);
+    EXPECT_EQ(table["routers"].size(), 2u);
+    EXPECT_EQ(
+        table["buckets"].dump(),
+        R"([{"appliance":"10.0.0.101","first":0,"last":63},{"appliance":"10.0.0.102","first":64,"last":255}])");
+    EXPECT_EQ(all["alarms"][0]["group"], 51);
+
+    const std::string screen = joined(draw_screen(shown, {80, 23, false, false, ""}));
+    for (const char *text :
+         {"1 alarm\n! group 51: a router is not connected as it should be, since 2026/11/25 00:10:11\n",
+          "51  ACTIVE, designated !  up 1:02:03  10.0.0.101 on eth0  tcp  weight 25  md5\n",
+          "  router 10.0.0.1        two-way   0:01:00  fwd gre  assign -     return l2",
+          "  router 10.0.0.3        nothing heard\n",
+          "  A 10.0.0.101      this weight 25    asked  30% has 20-25%  ####..",
+          "  hash AAAAAAAAAAAAAAAABBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBB\n"})
+        EXPECT_NE(screen.find(text), std::string::npos) << text << "\nnot in\n" << screen;
+    for (const std::string &line : draw_screen(shown, {79, 23, true, true, ""}))
+        EXPECT_LE(columns_of(line), 79u) << line;
+}
+
+TEST(Show, NothingOfATextReachesTheTerminalAsAControl) {
+    canned from = one_group();
+    for (ctl_binding &node : from.nodes)
+        if (node.name.find("/state") != std::string::npos && !node.name.ends_with("/oper"))
+            node.value += "\033[2J\x9b"
+                          "1m\r\n";
+    const picture shown = from.gather();
+    for (const std::string &text :
+         {joined(draw_screen(shown, {80, 0, false, false, ""})), joined(draw_lines(shown)), draw_json(shown)})
+        for (const char c : text)
+            ASSERT_TRUE(c == '\n' || (c >= 0x20 && c < 0x7f)) << static_cast<int>(c) << " in " << text;
+}
+
+TEST(Show, WorksWithoutWccpdAndTellsOfALostMgmtd) {
+    canned from = one_group();
+    for (const auto &[code, words] : std::map<uint32_t, std::string>{
+             {LC_IO_CLOSED, "wccpd is not running"}, {LC_IO_TIMED_OUT, "wccpd does not answer"}}) {
+        from.wccpd_code = code;
+        const std::string screen = joined(draw_screen(from.gather(), {80, 23, false, false, ""}));
+        EXPECT_TRUE(screen.starts_with(words)) << screen;
+        EXPECT_NE(screen.find("51  configured"), std::string::npos) << screen;
+        EXPECT_EQ(from.asked, 6u) << "it is not asked again";
+    }
+    from.wccpd_code = 0;
+    (void)from.gather();
+    for (size_t all = from.asked, n = 0; n < all; n++) {
+        from.lost_after = n;
+        const picture shown = from.gather();
+        EXPECT_TRUE(shown.groups.empty() && !shown.unreachable.empty());
+        EXPECT_EQ(json::parse(draw_json(shown))["mgmtd"], "unreachable");
+    }
+}
+
+TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
+    size_t asked = 0;
+    const picture_query query = [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *) {
+        asked++;
+        return many(walk, name, out);
+    };
+    picture_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
+    std::vector<std::string> lines = draw_screen(gather_picture(query, limits), {79, 23, true, true, ""});
+    EXPECT_LE(asked, 150u);
+    ASSERT_EQ(lines.size(), 23u);
+    EXPECT_NE(lines[1].find("routers 32/32"), std::string::npos) << lines[1];
+    EXPECT_NE(lines.back().find("and 235 groups not shown"), std::string::npos) << lines.back();
+
+    asked = 0;
+    limits = {.queries = 300};
+    const picture detailed = gather_picture(query, limits);
+    EXPECT_LE(asked, 300u + 70u);
+    const json all = json::parse(draw_json(detailed));
+    EXPECT_EQ(all["groups_total"], 256);
+    EXPECT_EQ(all["groups"].size(), 5u);
+    EXPECT_EQ(all["groups"][0]["appliances"].size(), 32u);
+    // A single group of 32 routers and 32 appliances is shortened, the others give way to it and are counted.
+    for (const int rows : {2, 7, 23, 60}) {
+        lines = draw_screen(detailed, {79, rows, false, false, ""});
+        EXPECT_LE(lines.size(), static_cast<size_t>(rows));
+        EXPECT_NE(lines.back().find("not shown"), std::string::npos) << lines.back();
+    }
+    EXPECT_NE(joined(draw_screen(detailed, {79, 60, false, false, ""})).find("and 30 routers more"),
+              std::string::npos);
+}
+
+TEST(Show, AssignmentTextsAreReadTolerantly) {
+    std::string mask = "\tReceived router allocation\n";
+    for (const auto &[appliance, words] :
+         std::map<std::string, std::string>{{"10.0.0.101", "0x0000000f"}, {"10.0.0.102", "0x00001ff0"}})
+        mask += "\tRouter id                  : 10.0.0.1\n\tAppliance ip               : " + appliance +
+                "\n\tRxed value buckets (0-127) : " + words + " 00000000 00000000 00000000\n";
+    picture_group group;
+    take_assignment_text(mask, &group);
+    ASSERT_EQ(group.tables.size(), 1u);
+    EXPECT_TRUE(group.tables[0].mask);
+    ASSERT_EQ(group.tables[0].owners.size(), 16u); // 13 values with an owner, of the 16 of four bits
+    EXPECT_EQ(group.tables[0].owners[3], 0);
+    EXPECT_EQ(group.tables[0].owners[4], 1);
+    EXPECT_EQ(group.tables[0].owners[13], -1);
+
+    const std::string whole = mask + hash_rows("10.0.0.2") + std::string(1000, '\t') + hash_rows("\033");
+    for (size_t length = 0; length < whole.size(); length++) {
+        std::string cut = whole.substr(0, length);
+        if (length > 4)
+            cut[length - 4] = static_cast<char>(length);
+        picture_group from;
+        take_assignment_text(cut, &from);
+        take_group_text(cut, &from);
+        for (const picture_table &table : from.tables)
+            for (const int owner : table.owners)
+                ASSERT_LT(owner, static_cast<int>(from.appliances.size()));
+    }
+    std::string crowd;
+    for (int i = 0; i < 2000; i++)
+        crowd += hash_rows(std::to_string(i)) + "\tAppliance ip               : " + std::to_string(i) + "\n";
+    picture_group from;
+    take_assignment_text(crowd, &from);
+    EXPECT_LE(from.appliances.size(), 32u);
+    EXPECT_LE(from.tables.size(), 32u);
+}
