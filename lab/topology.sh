@@ -22,6 +22,7 @@
 #     lab_configure NODE [TEXT]...            writes it anew, whole, and waits until mgmtd has taken it (1: refused)
 #     lab_mgmtd_start NODE, lab_wccpd_start NODE    one of them again, until it is ready
 #     lab_manage NODE WORDS...                mgmtctl --json WORDS inside the appliance
+#     lab_state NODE [GROUP]                  the groups by number, or one of them: the monitoring nodes as one JSON object
 #     lab_events NODE                         the lines of mgmtd since its start: sessions, commits, alarms, roles
 #     lab_role NODE GROUP                     the role that was last reported: ACTIVE, BACKUP, UNKNOWN
 #     lab_wait_role SECONDS NODE GROUP ROLE
@@ -387,6 +388,15 @@ lab_wait_log() { # SECONDS NODE EXPRESSION
 
 lab_manage() { # NODE WORDS...
     lab_in "$1" "$WCCP_BIN/mgmtctl" --json "${@:2}"
+}
+
+# {"51": {"oper": "ACTIVE, DESIGNATED", "router": {"1": {"state": ..., "appliance": {"10.0.0.101": {"load_dist": 100}}}},
+# "appliance": {"1": {"ipaddr": ..., "weight": ...}}, ...}}: nodes by the parts of their names.
+lab_state() { # NODE [GROUP]
+    lab_manage "$1" walk "/qv/wccpd/wccp/srv_grp/state${2:+/$2}" 2>/dev/null | jq -c --arg group "${2-}" '
+        map(.name) as $names | map(select((.name + "/") as $above | all($names[]; startswith($above) | not))) |
+        reduce .[] as $node ({}; setpath($node.name | split("/")[6:]; $node.value)) |
+        if $group == "" then . else .[$group] | objects // {} end'
 }
 
 # What would be left behind in an appliance: processes, shared memory and semaphores, sockets, interfaces, files. The
