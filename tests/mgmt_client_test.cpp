@@ -6,6 +6,7 @@
 #include "mgmt/log_levels.h"
 #include "mgmt/mdc_main.h"
 #include "runtime/logging.h"
+#include "tests/support/hand_session.h"
 #include "tests/support/log_lines.cpp" // this program is linked without the engine's helpers
 #include "tests/support/owners.h"
 
@@ -202,6 +203,142 @@ TEST(client, change_event) {
         EXPECT_EQ(mdc_event_config_change_notif_extract(bindings, nullptr, &after), 0);
     }
     EXPECT_NE(log.take().find("Unexpected change type moved under binding " ENTRY), std::string::npos);
+}
+
+// ---- Monitoring queries
+
+using strings = std::vector<std::string>;
+
+// The daemon's side of a query, which notes what it is asked, and the session over which the answer goes.
+struct monitored {
+    hand_session with;
+    owner<bn_request_msg, bn_request_msg_free> request;
+    strings asked;
+    lc_status failure = 0;
+
+    monitored() {
+        EXPECT_TRUE(with.open());
+        EXPECT_EQ(bn_query_request_msg_create(&request, 0, nullptr), 0);
+    }
+    void add_node(const std::string &name, uint32_t subop, uint32_t flags = 0, uint32_t mask_type = 0) {
+        binding_owner with_mask;
+        ASSERT_EQ(bn_binding_new_named(&with_mask, "x"), 0);
+        if (mask_type) {
+            ASSERT_EQ(bn_binding_set_str(with_mask, bn_attrib_capability_mask, mask_type, 0, "1"), 0);
+        }
+        ASSERT_EQ(bn_query_request_msg_append_with_attribs(request, subop, flags, name.c_str(),
+                                                           with_mask->attributes, nullptr),
+                  0);
+    }
+    void add_registered(const strings &names) {
+        for (const std::string &name : names)
+            add_node(name, bn_query_registration_info, 0, bn_type_uint32);
+    }
+    static lc_status get(const char *name, const tstr_array *, void *data, bn_binding_array *out) {
+        auto *self = static_cast<monitored *>(data);
+        self->asked.emplace_back(name);
+        add(out, name, "v");
+        return self->failure;
+    }
+    static lc_status list(const char *name, const tstr_array *parts, void *data, tstr_array *out) {
+        static_cast<monitored *>(data)->asked.push_back(std::string("?") + name);
+        EXPECT_EQ(bn_binding_name_pattern_match(name, "/a") ? 1u : 3u, tstr_array_length_quick(parts));
+        for (const char *child : {"1", "2"})
+            EXPECT_EQ(tstr_array_append_str(out, child), 0);
+        return LC_OK;
+    }
+    lc_status dispatch() { return mdc_dispatch_mon_request(with.session, request, get, this, list, this); }
+    // Each binding of the answer, with the id of the node that it answers behind it.
+    strings answer() {
+        const wire frame = with.provider.take_frame(100);
+        owner<tbuffer, tb_free> buffer;
+        response_owner response;
+        strings got;
+        if (frame.empty())
+            return {"(none)"};
+        EXPECT_EQ(tb_new_buf(&buffer, frame.data(), static_cast<int32_t>(frame.size())), 0);
+        EXPECT_EQ(bn_response_msg_deserialize(buffer, 32, &response), 0);
+        EXPECT_EQ(response->response_to, request->msg_id);
+        for (uint32_t i = 0; i < bn_response_per_node_array_length_quick(response->nodes); i++) {
+            const bn_response_node *node = bn_response_per_node_array_get_quick(response->nodes, i);
+            got.push_back(bn_binding_get_name_quick(node->binding) + (" " + std::to_string(node->node_id)));
+        }
+        return got;
+    }
+};
+
+TEST(client, monitoring_walk) {
+    constexpr uint32_t get = bn_query_get, walk = bn_query_iterate;
+    constexpr uint32_t tree = bn_qf_subtree, self = bn_qf_include_self, leaves = bn_qf_leaves_only;
+    const struct {
+        const char *name;
+        uint32_t subop, flags;
+        strings asked; // "?" before what is asked for its children
+    } cases[] = {
+        {"/a/1/b", get, 0, {"/a/1/b"}},
+        {"/other", get, 0, {"/other"}},
+        {"/other", walk, tree | self, {}},
+        {"/a/*", walk, 0, {"?/a", "/a/1", "/a/2"}},
+        {"/a", walk, 0, {"?/a", "/a/1", "/a/2"}}, // the direct children and no deeper
+        {"/a/1", walk, 0, {"/a/1/b"}},
+        {"/a/1", walk, self, {"/a/1", "/a/1/b"}},
+        {"/a/1/c", walk, 0, {"?/a/1/c", "/a/1/c/1", "/a/1/c/2"}},
+        {"/a/1", walk, tree, {"/a/1/b", "?/a/1/c", "/a/1/c/1", "/a/1/c/2"}},
+        {"/a/1", walk, tree | self | leaves, {"/a/1/b", "?/a/1/c", "/a/1/c/1", "/a/1/c/2"}},
+        {"/a/1", walk, tree | bn_qf_walk_only, {"?/a/1/c"}},
+        {"/s", walk, 0, {"/s/x"}},
+        {"/s", walk, tree, {"/s/x", "/s/x/y"}},
+        {"/s", walk, tree | leaves, {"/s/x/y"}},
+        {"/s/x/y", walk, 0, {}},
+        {"/s/x/y", walk, self, {"/s/x/y"}},
+        {"/", walk, 0, {}}, // nothing registered directly below
+    };
+    for (const auto &row : cases) {
+        SCOPED_TRACE(std::string(row.name) + " " + std::to_string(row.flags));
+        monitored daemon;
+        daemon.add_node(row.name, row.subop, row.flags); // before what it is looked up in
+        daemon.add_registered({"/a/*", "/a/*/b", "/a/*/c/*", "/s/x", "/s/x", "/s/x/y"});
+        ASSERT_EQ(daemon.dispatch(), 0);
+        EXPECT_EQ(daemon.asked, row.asked);
+        strings answered;
+        for (const std::string &name : row.asked)
+            if (name[0] != '?')
+                answered.push_back(name + " 1000");
+        EXPECT_EQ(daemon.answer(), answered);
+    }
+}
+
+TEST(client, monitoring_answers) {
+    log_lines log;
+    std::string deep;
+    for (int part = 1; part <= 64; part++)
+        deep += "/d";
+    monitored several;
+    several.add_registered({deep, deep + "/e"});
+    several.add_node("/odd", bn_query_none);
+    several.add_node(deep, bn_query_iterate, bn_qf_include_self);
+    several.add_node("/one", bn_query_get);
+    ASSERT_EQ(several.dispatch(), 0);
+    EXPECT_EQ(several.answer(), (strings{deep + " 1003", "/one 1004"}));
+    const std::string lines = log.take();
+    EXPECT_NE(lines.find("Registered name of 65 parts ignored"), std::string::npos);
+    EXPECT_NE(lines.find("Unexpected query subop 0; ignoring request for binding /odd"), std::string::npos);
+
+    for (const lc_status status : {LC_NULL, LC_ASSERTION, LC_BAD_TYPE}) { // and no answer goes
+        monitored failing;
+        if (status == LC_NULL)
+            failing.add_node("/a", bn_query_registration_info);
+        else if (status == LC_ASSERTION)
+            failing.add_node("/a", bn_query_registration_info, 0, bn_type_str);
+        failing.failure = LC_BAD_TYPE;
+        failing.add_node("/one", bn_query_get);
+        EXPECT_EQ(failing.dispatch(), status);
+        EXPECT_EQ(failing.answer(), strings{"(none)"});
+    }
+    monitored empty;
+    EXPECT_EQ(empty.dispatch(), LC_ASSERTION);
+    empty.request->msg_type = bn_msg_event;
+    EXPECT_EQ(empty.dispatch(), LC_ASSERTION);
 }
 
 #define MESSAGES "/logging/syslog/action/file/\\/var\\/log\\/messages/facility/"
