@@ -70,15 +70,12 @@ protected:
     std::unique_ptr<wccp_view_appliance[]> appliances{new wccp_view_appliance[2048]{}};
 };
 
-wire_bytes hex(const std::string &digits) {
-    return wire_bytes().hex(digits);
-}
 const wire_bytes no_security = hex("0000 0004 00000000");
-const wire_bytes standard_service = hex("0001 0018 00 32").zeros(22);
-const wire_bytes dynamic_service = hex("0001 0018 01 33 c8 06 00000013").zeros(16);
+const wire_bytes standard_service = hex("0001 0018 00 32 00*22");
+const wire_bytes dynamic_service = hex("0001 0018 01 33 c8 06 00000013 00*16");
 
 TEST_F(Load, TheFirstHereIAmOfAStandardGroup) {
-    const wire_bytes identity = hex("0003 002c 0a000064 0000 0000").zeros(32).hex("0102 0000");
+    const wire_bytes identity = hex("0003 002c 0a000064 0000 0000 00*32 0102 0000");
     const wire_bytes view = hex("0005 000c 01020304 00000000 00000000");
     ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
     EXPECT_EQ(loaded(), wire_message(10, {no_security, standard_service, identity, view}));
@@ -105,7 +102,7 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
     add_routers(2);
     add_appliances(3);
     const wire_bytes security = hex("0000 0014 00000001 320b25f1d72ee64dfe0cd67d26c5f037");
-    const wire_bytes service = hex("0001 0018 01 5a c8 06 00000013").zeros(16);
+    const wire_bytes service = hex("0001 0018 01 5a c8 06 00000013 00*16");
     const wire_bytes identity =
         hex("0003 0020 0a000064 0000 0002 00000001 00001741 00000f00 0021 8001 00000000 0102 0000");
     const wire_bytes view = hex("0005 0028 01020304 00000002 0a000102 a1a2a301 0a000101 a1a2a300 "

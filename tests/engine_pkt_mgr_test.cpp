@@ -23,9 +23,6 @@ be32 ipa(uint8_t third, uint8_t fourth) {
 }
 const be32 SENDER = ipa(0, 1);
 
-wire_bytes hex(const std::string &digits) {
-    return wire_bytes().hex(digits);
-}
 const wire_bytes security = hex("0000 0004 00000000");
 wire_bytes service(uint32_t id = 51, uint32_t priority = 200, uint32_t protocol = 6, uint32_t flags = 0x13) {
     return hex("0001 0018 01").u8(id).u8(priority).u8(protocol).u32(flags).zeros(16);

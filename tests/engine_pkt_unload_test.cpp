@@ -44,32 +44,10 @@ const reader read_command = read_group<wccp_command_info, wccp_pkt_unload_comman
 const reader read_query = read_group<const wccp_wire_router_query *, wccp_pkt_unload_router_query_component>;
 const reader read_unknown = wccp_pkt_unload_unknown_component;
 
-wire_bytes hex(const std::string &digits) {
-    return wire_bytes().hex(digits);
-}
-wire_bytes security(uint32_t type, uint32_t length, uint32_t option) {
-    return wire_bytes().u16(type).u16(length).u32(option);
-}
-wire_bytes service(uint32_t type, uint32_t length) {
-    return wire_bytes().u16(type).u16(length).u8(1).u8(51).u8(200).u8(6).u32(0x13).fill(16, 0x5a);
-}
-wire_bytes identity(uint32_t type, uint32_t length, uint32_t count, size_t addresses) {
-    return wire_bytes()
-        .u16(type)
-        .u16(length)
-        .hex("0a000101 a1a2a3a4 0a000202")
-        .u32(count)
-        .fill(4 * addresses, 7);
-}
-wire_bytes hash_element(uint32_t id, uint32_t weight) {
-    return wire_bytes().ip(0, id).u16(0).u16(0).fill(32, 0x11).u16(weight).u16(0);
-}
-wire_bytes mask_element(uint32_t id, uint32_t flags, uint32_t weight) { // the 32-byte form
-    return wire_bytes().ip(0, id).u16(0).u16(flags).fill(20, 0x22).u16(weight).u16(0);
-}
-wire_bytes short_element(uint32_t id, uint32_t weight) {
-    return wire_bytes().ip(0, id).u16(0).u16(2).u32(0x33).u16(weight).u16(0);
-}
+const wire_bytes hash_element = hex("0a000001 0000 0000 11*32 0064 0000");
+const wire_bytes mask_element = hex("0a000002 0000 0002 22*20 0064 0000"); // that redirects, in Nexus mode
+const wire_bytes idle_element = hex("0a000003 0000 0003 22*20 0064 0000");
+const wire_bytes short_element = hex("0a000004 0000 0002 33*4 0064 0000"); // that redirects, in IOS mode
 // Counts as told, and what is there.
 wire_bytes view(uint32_t routers = 0, uint32_t addresses = 0, uint32_t appliances = 0,
                 const std::vector<wire_bytes> &elements = {}, uint32_t type = 4, int length_error = 0) {
@@ -81,21 +59,6 @@ wire_bytes view(uint32_t routers = 0, uint32_t addresses = 0, uint32_t appliance
         out.add(element);
     return out.put16(2, static_cast<uint32_t>(static_cast<int>(out.size()) - 4 + length_error));
 }
-wire_bytes value(uint32_t number, uint32_t id) {
-    return wire_bytes().u32(number).u32(0).u16(0).u16(0).ip(0, id);
-}
-// A map of one element with `count` values told and `values` there.
-wire_bytes map(uint32_t length, uint32_t elements, uint32_t count, uint32_t values) {
-    wire_bytes out =
-        wire_bytes().u16(14).u16(length).u32(elements).u32(0x1741).u32(0xf00).u16(1).u16(2).u32(count);
-    for (uint32_t i = 0; i < values; i++)
-        out.add(value(i, 100 + i));
-    return out;
-}
-wire_bytes capability(uint32_t type, uint32_t number) {
-    return wire_bytes().u16(type).u16(4).u32(number);
-}
-
 class Unload : public testing::Test {
 protected:
     void SetUp() override {
@@ -128,24 +91,24 @@ TEST_F(Unload, NothingIsReadBehindWhatCame) {
         wire_bytes bytes;
     } rows[] = {
         {read_header, hex("0000000b 0200 0064")},
-        {read_security, security(0, 4, 0)},
-        {read_security, security(0, 20, 1).fill(16, 0x77)},
-        {read_service, service(1, 24)},
-        {read_identity, identity(2, 16, 0, 0)},
-        {read_identity, identity(2, 28, 3, 3)},
+        {read_security, hex("0000 0004 00000000")},
+        {read_security, hex("0000 0014 00000001 77*16")},
+        {read_service, hex("0001 0018 01 33 c8 06 00000013 5a*16")},
+        {read_identity, hex("0002 0010 0a000101 a1a2a3a4 0a000202 00000000")},
+        {read_identity, hex("0002 001c 0a000101 a1a2a3a4 0a000202 00000003 07*12")},
         {read_view, view()},
         {read_view, view(2, 2)},
-        {read_view, view(1, 1, 3, {hash_element(1, 1), short_element(2, 2), mask_element(3, 3, 3)})},
-        {read_view, view(32, 32, 32, std::vector<wire_bytes>(32, hash_element(1, 1)))},
-        {read_map, map(36, 1, 1, 1)},
-        {read_map, map(20 + 16 * 5, 1, 5, 5)},
+        {read_view, view(1, 1, 3, {hash_element, short_element, idle_element})},
+        {read_view, view(32, 32, 32, std::vector<wire_bytes>(32, hash_element))},
+        {read_map, hex("000e 0024 00000001 11*12 00000001 55*16")},
+        {read_map, hex("000e 0064 00000001 11*12 00000005 55*80")},
         {read_capabilities, hex("0008 0000")},
-        {read_capabilities, wire_bytes().u16(8).u16(16).add(capability(1, 2)).add(capability(2, 3))},
+        {read_capabilities, hex("0008 0010 0001 0004 00000002 0002 0004 00000003")},
         {read_command, hex("000f 0008 0001 0004 0a000001")},
-        {read_command, hex("000f 000d 0001 0004 0a000001 0909090909")},
+        {read_command, hex("000f 000d 0001 0004 0a000001 09*5")},
         {read_query, hex("0007 0010 0a000101 00000005 0a000202 0a000064")},
         {read_unknown, hex("0063 0000")},
-        {read_unknown, hex("0063 0007 01010101010101")},
+        {read_unknown, hex("0063 0007 01*7")},
     };
     for (size_t row = 0; row < std::size(rows); row++)
         for (const uint32_t shift : {0u, 1u, 3u}) {
@@ -162,61 +125,60 @@ TEST_F(Unload, NothingIsReadBehindWhatCame) {
 TEST_F(Unload, RefusalsSayWhy) {
     const std::string bad_map =
         "unload assignment map: packet length is BAD or it has bogus values. rxed len: ";
-    const wire_bytes three_there[] = {hash_element(1, 1), hash_element(2, 2), hash_element(3, 3)};
     const struct {
         reader read;
         wire_bytes bytes;
         std::string line; // with its group in front unless it begins with a W; empty: nothing is logged
     } rows[] = {
-        {read_security, security(3, 4, 0), "WCCP: expected security componenet. rxed 3"},
-        {read_security, security(0, 8, 0).fill(16, 0), ""},
-        {read_security, security(0, 21, 1).fill(20, 0), ""},
-        {read_service, service(2, 24), "WCCP: expected service info componenet. rxed 2"},
-        {read_service, service(1, 20), ""},
-        {read_service, service(1, 28).fill(8, 0), ""},
-        {read_identity, wire_bytes().zeros(19), "static length (20) is longer than remaining pkt len (19)"},
-        {read_identity, identity(4, 16, 0, 0), "expecting router id info, rxed 4"},
-        {read_identity, identity(2, 24, 3, 2), "full length does not fit in pkt"},
-        {read_identity, identity(2, 16, 0x40000000, 8), "full length does not fit in pkt"},
-        {read_identity, identity(2, 12, 0xffffffff, 8), "full length does not fit in pkt"},
-        {read_identity, identity(2, 20, 2, 2), "rxed length (20) and expected length (24) mismatch"},
-        {read_view, wire_bytes().zeros(19), "static component does not fit in pkt"},
+        {read_security, hex("0003 0004 00000000"), "WCCP: expected security componenet. rxed 3"},
+        {read_security, hex("0000 0008 00000000 00*16"), ""},
+        {read_security, hex("0000 0015 00000001 00*20"), ""},
+        {read_service, hex("0002 0018 5a*24"), "WCCP: expected service info componenet. rxed 2"},
+        {read_service, hex("0001 0014 5a*24"), ""},
+        {read_service, hex("0001 001c 5a*28"), ""},
+        {read_identity, hex("00*19"), "static length (20) is longer than remaining pkt len (19)"},
+        {read_identity, hex("0004 0010 00*16"), "expecting router id info, rxed 4"},
+        {read_identity, hex("0002 0018 07*12 00000003 07*8"), "full length does not fit in pkt"},
+        {read_identity, hex("0002 0010 07*12 40000000 07*32"), "full length does not fit in pkt"},
+        {read_identity, hex("0002 000c 07*12 ffffffff 07*32"), "full length does not fit in pkt"},
+        {read_identity, hex("0002 0014 07*12 00000002 07*8"),
+         "rxed length (20) and expected length (24) mismatch"},
+        {read_view, hex("00*19"), "static component does not fit in pkt"},
         {read_view, view(0, 0, 0, {}, 5), "WCCP: bad router view type rxed (5)"},
         {read_view, view(33, 33), "bad number of routers (33) in ICU pkt. "},
         {read_view, view(0xffffffff, 2), "bad number of routers (-1) in ICU pkt. "},
         {read_view, view(32, 30), "number of routers does not fit in pkt"},
         {read_view, view(0, 0, 33), "bad number of appliances (33) in ICU pkt."},
         {read_view, view(0, 0, 0x80000000), "bad number of appliances"},
-        {read_view, view(0, 0, 4, {three_there[0], three_there[1], three_there[2]}),
+        {read_view, view(0, 0, 4, {hash_element, hash_element, hash_element}),
          "# of appliances (4 x 44 bytes) does not fit in pkt length (0)"},
-        {read_view, view(0, 0, 1, {wire_bytes().zeros(43)}, 4, 1),
+        {read_view, view(0, 0, 1, {hex("00*43")}, 4, 1),
          "# of appliances (1 x 44 bytes) does not fit in pkt length (0)"},
-        {read_view, view(0, 0, 1, {hash_element(1, 1)}, 4, -1),
+        {read_view, view(0, 0, 1, {hash_element}, 4, -1),
          "bad length. rxed length 63 pkt length 64 (check compatibility mode (IOS/Nexus))"},
-        {read_view, view(0, 0, 1, {mask_element(1, 2, 1)}),
+        {read_view, view(0, 0, 1, {mask_element}),
          "bad length. rxed length 52 pkt length 36 (check compatibility mode (IOS/Nexus))"},
-        {read_map, hex("000e 0023").zeros(35),
-         "minimum assignment map (len = 40) does not fit in the packet. router src ip : "
-         "10.0.9.9 "},
-        {read_map, map(35, 1, 1, 1),
+        {read_map, hex("000e 0023 00*35"),
+         "minimum assignment map (len = 40) does not fit in the packet. router src ip : 10.0.9.9 "},
+        {read_map, hex("000e 0023 00000001 11*12 00000001 55*16"),
          " assignment map length: 35 does not include at least one mask/value set (expected "
          "minimum len: 36)  router src ip : 10.0.9.9 "},
-        {read_map, map(36, 1, 2, 2), bad_map + "36 current len 52."},
-        {read_map, map(52, 1, 2, 1), bad_map + "52 current len 52."},
-        {read_map, map(36, 1, 0x10000000, 1), bad_map + "36"},
-        {read_map, map(36, 1, 0x0fffffff, 2), bad_map + "36"},
-        {read_map, map(65535, 1, 0xffffffff, 1), bad_map + "65535"},
-        {read_map, map(65535, 2, 1, 1), bad_map + "65535"},
-        {read_map, map(65535, 0xffffffff, 0, 20), bad_map + "65535"},
-        {read_capabilities, wire_bytes().u16(8).u16(12).add(capability(1, 2)).u32(0),
+        {read_map, hex("000e 0024 00000001 11*12 00000002 55*32"), bad_map + "36 current len 52."},
+        {read_map, hex("000e 0034 00000001 11*12 00000002 55*16"), bad_map + "52 current len 52."},
+        {read_map, hex("000e 0024 00000001 11*12 10000000 55*16"), bad_map + "36"},
+        {read_map, hex("000e 0024 00000001 11*12 0fffffff 55*32"), bad_map + "36"},
+        {read_map, hex("000e ffff 00000001 11*12 ffffffff 55*16"), bad_map + "65535"},
+        {read_map, hex("000e ffff 00000002 11*12 00000001 55*16"), bad_map + "65535"},
+        {read_map, hex("000e ffff ffffffff 11*12 00000000 00*320"), bad_map + "65535"},
+        {read_capabilities, hex("0008 000c 0001 0004 00000002 00*4"),
          "capability component length is not aligned. length 12 individual element size 8"},
-        {read_capabilities, wire_bytes().u16(8).u16(16).add(capability(1, 2)), ""},
+        {read_capabilities, hex("0008 0010 0001 0004 00000002"), ""},
         {read_command, hex("000f 0008 0001 0004 0000"), "no commands in pkt"},
         {read_command, hex("000f 0009 0001 0004 00000000"),
          "bogus component length (9): does not  fit in the packet."},
-        {read_query, wire_bytes().zeros(19), "router query comp. does not fit in packet."},
-        {read_query, hex("0008 0010").zeros(16), "bad router query type rxed (8)"},
-        {read_query, hex("0007 0014").zeros(20), "bad length. rxed length 20 pkt length 16"},
+        {read_query, hex("00*19"), "router query comp. does not fit in packet."},
+        {read_query, hex("0008 0010 00*16"), "bad router query type rxed (8)"},
+        {read_query, hex("0007 0014 00*20"), "bad length. rxed length 20 pkt length 16"},
         {read_unknown, hex("0063 0005 00000000"),
          "unkown pkt length does not fit in the packet. component type: 99 length 5 "},
     };
@@ -236,12 +198,12 @@ TEST_F(Unload, RefusalsSayWhy) {
 TEST_F(Unload, SecurityHasItsDigestInThePacket) {
     const wccp_wire_security_info *info;
     uint8_t *digest;
-    received_packet pkt = at(security(0, 20, 1).fill(16, 0x77).u32(0));
+    received_packet pkt = at(hex("0000 0014 00000001 77*16 00*4"));
     EXPECT_EQ(wccp_pkt_unload_security_info_component(pkt.get(), &info, &digest), 0);
     EXPECT_EQ(digest, pkt->data + 8);
     EXPECT_EQ(pkt->offset, 24u);
     for (const uint32_t length : {0u, 2u, 4u}) { // a shorter length passes
-        pkt = at(security(0, length, 2).fill(16, 0));
+        pkt = at(wire_bytes().u16(0).u16(length).hex("00000002 00*16"));
         EXPECT_EQ(wccp_pkt_unload_security_info_component(pkt.get(), &info, &digest), 0);
         EXPECT_EQ(digest, nullptr);
         EXPECT_EQ(to_host(info->option), 2u);
@@ -267,8 +229,7 @@ TEST_F(Unload, TheFormOfAnElementFollowsFlagsAndMode) {
                     shape.weight_at == row.shape.weight_at)
             << row.flags << " in mode " << row.mode;
     }
-    const wire_bytes ios = view(0, 0, 1, {short_element(1, 1)}),
-                     nexus = view(0, 0, 1, {mask_element(1, 2, 1)});
+    const wire_bytes ios = view(0, 0, 1, {short_element}), nexus = view(0, 0, 1, {mask_element});
     EXPECT_EQ(passed(read_view, ios), 40);
     EXPECT_EQ(passed(read_view, nexus), -1);
     group.compat_mode = WCCP_COMPAT_NEXUS;
@@ -277,9 +238,10 @@ TEST_F(Unload, TheFormOfAnElementFollowsFlagsAndMode) {
 }
 
 TEST_F(Unload, AMapKeepsItsFirstMaskAndItsLastValues) {
-    wire_bytes two = hex("000e 0058 00000002"); // four bytes more than the elements need: they stay unread
-    two.hex("00001741 00000000 0000 0000 00000001").add(value(1, 100));
-    two.hex("00009999 00000000 0000 0000 00000002").add(value(2, 101)).add(value(3, 102)).u32(0);
+    // Four bytes more than the elements need: they stay unread.
+    const wire_bytes two = hex("000e 0058 00000002 "
+                               "00001741 00*8 00000001 00000001 00*8 0a000064 "
+                               "00009999 00*8 00000002 00000002 00*8 0a000065 00000003 00*8 0a000066 00*4");
     received_packet pkt = at(two, 1);
     wccp_assign_map_info out = {};
     ASSERT_EQ(wccp_pkt_unload_assignment_map_component(&group, pkt.get(), &out), 0);
@@ -289,7 +251,7 @@ TEST_F(Unload, AMapKeepsItsFirstMaskAndItsLastValues) {
     EXPECT_EQ(out.values[1].appliance_id, (be32{{10, 0, 0, 102}}));
     EXPECT_EQ(pkt->offset, 1u + 8 + 32 + 48);
 
-    pkt = at(map(36, 0, 9, 1));
+    pkt = at(hex("000e 0024 00000000 11*12 00000009 55*16"));
     out = {};
     ASSERT_EQ(wccp_pkt_unload_assignment_map_component(&group, pkt.get(), &out), 0);
     EXPECT_EQ(out.present, 1u);
@@ -307,7 +269,7 @@ TEST_F(Unload, CapabilitiesTakeTheLastOfEachKind) {
     EXPECT_TRUE(out.forwarding == 0x103 && out.assignment == 3 && out.ret == 2);
     EXPECT_EQ(group.rx_unknown_capabilities, 1u);
     EXPECT_NE(log.take(), "") << "more than the three known ones are worth a line";
-    pkt = at(hex("0008 0018").add(capability(1, 2)).add(capability(2, 2)).add(capability(3, 2)));
+    pkt = at(hex("0008 0018 0001 0004 00000002 0002 0004 00000002 0003 0004 00000002"));
     ASSERT_EQ(wccp_pkt_unload_capability_info_component(&group, pkt.get(), &out), 0);
     EXPECT_EQ(log.take(), "");
 }

@@ -27,15 +27,21 @@ struct wire_bytes {
         bytes.insert(bytes.end(), other.bytes.begin(), other.bytes.end());
         return *this;
     }
-    // "00 02 00 04": pairs of hexadecimal digits, anything else between them.
+    // "0002 0004 ee*3": pairs of hexadecimal digits, anything else between them; a star repeats the last byte
+    // to so many.
     wire_bytes &hex(const std::string &digits) {
         std::string pair;
-        for (const char digit : digits) {
-            if (isxdigit(static_cast<unsigned char>(digit)))
-                pair += digit;
+        for (size_t at = 0; at < digits.size(); at++) {
+            if (isxdigit(static_cast<unsigned char>(digits[at])))
+                pair += digits[at];
             if (pair.size() == 2) {
                 u8(static_cast<uint32_t>(std::stoul(pair, nullptr, 16)));
                 pair.clear();
+            }
+            if (digits[at] == '*') {
+                size_t length;
+                fill(std::stoul(digits.substr(at + 1), &length) - 1, bytes.back());
+                at += length;
             }
         }
         return *this;
@@ -47,6 +53,10 @@ struct wire_bytes {
     }
     size_t size() const { return bytes.size(); }
 };
+
+inline wire_bytes hex(const std::string &digits) {
+    return wire_bytes().hex(digits);
+}
 
 // A message: its eight header bytes, then its components.
 inline std::vector<uint8_t> wire_message(uint32_t type, const std::vector<wire_bytes> &components) {
