@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <memory>
 
@@ -235,46 +236,39 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
     }
 }
 
-// Each component goes to the last byte of the packet and not one byte further.
+// A message begun at every distance from the end of the packet: each component goes to the last byte, and not
+// one byte further; what doesn't fit leaves the packet as it was.
 TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
     group->security_option = 1;
-    group->fwd_method = group->assign_method = group->ret_method = 2;
+    group->fwd_method = group->ret_method = WCCP_METHOD_L2;
+    group->state_flags = WCCP_SHUTTING_DOWN;
     add_routers(3);
     add_appliances(2);
     designate(2);
     group->mask_value_count = 5;
-    using load = int (*)(wccp_service_group *, wccp_pkt *);
     const struct {
-        uint32_t size;
-        load function;
+        int (*build)(wccp_service_group *, wccp_pkt *);
+        uint32_t assign_method;
+        std::vector<uint32_t> sizes;
     } rows[] = {
-        {8, [](wccp_service_group *, wccp_pkt *to) { return wccp_pkt_load_msg_header(to, WCCP_HERE_I_AM); }},
-        {24,
-         [](wccp_service_group *from, wccp_pkt *to) {
-             uint8_t *digest;
-             return wccp_pkt_load_security_info_component(from, to, &digest);
-         }},
-        {28, wccp_pkt_load_service_info_component},
-        {36, wccp_pkt_load_web_cache_identity_info_component},
-        {16 + 8 * 3 + 4 * 2, wccp_pkt_load_web_cache_view_info_component},
-        {276 + 12 * 3 + 4 * 2, wccp_pkt_load_assignment_info_component},
-        {40 + 12 * 3 + 16 * 5, wccp_pkt_load_mask_assignment_info_component},
-        {28, wccp_pkt_load_capability_info_component},
-        {12, wccp_pkt_load_command_ext_component},
+        {wccp_pkt_build_here_i_am, 2, {8, 24, 28, 36, 16 + 8 * 3 + 4 * 2, 28, 12}},
+        {wccp_pkt_build_here_i_am, 1, {8, 24, 28, 48, 16 + 8 * 3 + 4 * 2, 20, 12}},
+        {wccp_pkt_build_redirect_assign, 1, {8, 24, 28, 276 + 12 * 3 + 4 * 2}},
+        {wccp_pkt_build_redirect_assign, 2, {8, 24, 28, 40 + 12 * 3 + 16 * 5}},
     };
-    for (const auto &row : rows) {
-        for (const uint32_t missing : {0u, 1u}) {
+    for (const auto &row : rows)
+        for (uint32_t start = 4096 - 400; start <= 4096; start++) {
             clear();
-            pkt->length = pkt->offset = 4096 - row.size + missing;
-            pkt->cursor = pkt->data + pkt->offset;
-            const auto before = std::make_unique<wccp_pkt>(*pkt);
-            EXPECT_EQ(row.function(group.get(), pkt.get()), static_cast<int>(missing)) << row.size;
-            if (missing)
-                EXPECT_EQ(memcmp(before.get(), pkt.get(), sizeof *pkt), 0) << row.size;
-            else
-                EXPECT_TRUE(pkt->length == 4096 && pkt->offset == 4096 && pkt->cursor == pkt->data + 4096);
+            group->assign_method = row.assign_method;
+            pkt->length = pkt->offset = start;
+            uint32_t end = start;
+            size_t fitting = 0;
+            while (fitting < row.sizes.size() && end + row.sizes[fitting] <= 4096)
+                end += row.sizes[fitting++];
+            ASSERT_EQ(row.build(group.get(), pkt.get()), fitting == row.sizes.size() ? 0 : 1) << start;
+            ASSERT_TRUE(pkt->length == end && pkt->offset == end) << start;
+            ASSERT_EQ(std::count(pkt->data + end, pkt->data + 4096, 0), 4096 - end) << start;
         }
-    }
 }
 
 TEST_F(Load, AViewThatIsTooLargeOrMiscountedIsRefused) {
