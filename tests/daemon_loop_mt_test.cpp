@@ -82,10 +82,12 @@ TEST(LoopThreads, AnEscapeFromOutsideEndsTheWaitAtEachDepth) {
     }
 }
 
+struct counts {
+    std::atomic<int> carried{0}, withdrawn{0};
+};
 struct counted_post {
     loop_post post{};
-    std::atomic<int> *carried;
-    std::atomic<int> *withdrawn;
+    counts *all;
     loop_context *loop;
     int number;
     int *expected;
@@ -94,61 +96,56 @@ struct counted_post {
         if (carry_out) {
             EXPECT_TRUE(loop_is_own_thread(self->loop));
             EXPECT_EQ(self->number, (*self->expected)++);
-            (*self->carried)++;
-        } else {
-            (*self->withdrawn)++;
         }
+        (carry_out ? self->all->carried : self->all->withdrawn)++;
         delete self;
+    }
+    static void send(counts *all, loop_context *loop, int number, int *expected) {
+        auto *record = new counted_post{{}, all, loop, number, expected};
+        record->post.function = function;
+        record->post.poster = expected;
+        loop_post_work(loop, &record->post);
     }
 };
 
 TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
     constexpr int posters = 3, each = 2000;
-    std::atomic<int> carried{0}, withdrawn{0};
-    int expected[posters] = {};
+    counts all;
+    int expected[posters] = {}, unused[2] = {};
     loop_thread it;
     it.start();
     std::thread threads[posters];
     for (int poster = 0; poster < posters; poster++)
         threads[poster] = std::thread([&, poster] {
-            for (int i = 0; i < each; i++) {
-                auto *post = new counted_post{{}, &carried, &withdrawn, it.loop, i, &expected[poster]};
-                post->post.function = counted_post::function;
-                post->post.poster = &threads[poster];
-                loop_post_work(it.loop, &post->post);
-            }
+            for (int i = 0; i < each; i++)
+                counted_post::send(&all, it.loop, i, &expected[poster]);
         });
     for (std::thread &thread : threads)
         thread.join();
-    for (const double start = now_seconds(); carried < posters * each && now_seconds() - start < 4;)
+    for (const double start = now_seconds(); all.carried < posters * each && now_seconds() - start < 4;)
         usleep(1000);
-    EXPECT_EQ(carried, posters * each);
+    EXPECT_EQ(all.carried, posters * each);
     EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
     it.thread.join();
     // What comes too late is handed back, by name or with the loop.
-    int unused = 0;
-    for (int i = 0; i < 2; i++) {
-        auto *post = new counted_post{{}, &carried, &withdrawn, it.loop, 0, &unused};
-        post->post.function = counted_post::function;
-        post->post.poster = i ? &withdrawn : &carried;
-        loop_post_work(it.loop, &post->post);
-    }
-    loop_withdraw_posted(it.loop, &carried);
-    EXPECT_EQ(withdrawn, 1);
+    for (int &poster : unused)
+        counted_post::send(&all, it.loop, 0, &poster);
+    loop_withdraw_posted(it.loop, &unused[0]);
+    EXPECT_EQ(all.withdrawn, 1);
     it.thread = std::thread([] {});
     it.finish();
-    EXPECT_EQ(withdrawn, 2);
+    EXPECT_EQ(all.withdrawn, 2);
 }
 
 // A wait for one round ends with work that was posted: what it waits for may have been changed by that.
 TEST(LoopThreads, PostedWorkEndsANestedWait) {
-    std::atomic<int> carried{0}, withdrawn{0};
+    counts all;
     std::atomic<int> waiting{0};
     int expected = 0;
     loop_thread it;
     it.first = [&] {
         waiting = 1;
-        while (!carried)
+        while (!all.carried)
             ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, nullptr), LC_OK);
         ASSERT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
     };
@@ -157,9 +154,7 @@ TEST(LoopThreads, PostedWorkEndsANestedWait) {
         usleep(1000);
     usleep(20000);
     const double start = now_seconds();
-    auto *post = new counted_post{{}, &carried, &withdrawn, it.loop, 0, &expected};
-    post->post.function = counted_post::function;
-    loop_post_work(it.loop, &post->post);
+    counted_post::send(&all, it.loop, 0, &expected);
     it.finish();
     EXPECT_LT(now_seconds() - start, 2);
 }

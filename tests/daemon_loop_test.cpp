@@ -1,5 +1,4 @@
-// The loop: rounds that nest, events that go while they wait for their turn, the escape, signals, and work
-// that other threads post.
+// The loop: rounds that nest, events that go while they wait for their turn, the escape and signals.
 #include "daemon/libevent_wrapper.h"
 
 #include <csignal>
@@ -32,6 +31,20 @@ struct Loop : testing::Test {
         EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
         EXPECT_EQ(wrapper, nullptr);
     }
+    // How it ended: "no events", "escaped", "ran" or a status.
+    std::string dispatched(lc_status (*dispatch)(lew *, int *, int *)) const {
+        int none = 5, escaped = 5;
+        const lc_status status = dispatch(wrapper, &none, &escaped);
+        if (status != LC_OK)
+            return std::to_string(status);
+        return none == 1 && escaped == 0   ? "no events"
+               : none == 0 && escaped == 1 ? "escaped"
+               : none == 0 && escaped == 0 ? "ran"
+                                           : "nonsense";
+    }
+    std::string once() const { return dispatched(lew_dispatch_once); }
+    std::string whole() const { return dispatched(lew_dispatch); }
+    void escape() const { EXPECT_EQ(lew_escape_from_dispatch(wrapper), LC_OK); }
 };
 
 // An event with a pipe that has a byte in it until the event has run.
@@ -39,6 +52,7 @@ struct readable {
     loop_event *event = nullptr;
     int ends[2] = {-1, -1};
     int runs = 0;
+    bool closed = false;
     std::function<void()> action;
     void start(loop_context *loop) {
         ASSERT_EQ(pipe(ends), 0);
@@ -49,10 +63,9 @@ struct readable {
     void fill() const { ASSERT_EQ(write(ends[1], "x", 1), 1); }
     static void fired(int fd, short flags, void *data) {
         auto *self = static_cast<readable *>(data);
-        EXPECT_EQ(fd, self->ends[0]);
         EXPECT_EQ(flags, LOOP_READ);
         char byte;
-        EXPECT_EQ(read(fd, &byte, 1), 1);
+        EXPECT_EQ(read(fd, &byte, 1), self->closed ? -1 : 1);
         self->runs++;
         if (self->action)
             self->action();
@@ -82,52 +95,55 @@ struct timer {
     ~timer() { loop_event_free(&event); }
 };
 
-TEST_F(Loop, NothingRegisteredEndsWithNoEvents) {
-    int none = 5, escaped = 5;
-    EXPECT_EQ(lew_dispatch(wrapper, &none, &escaped), LC_OK);
-    EXPECT_EQ(none, 1);
-    EXPECT_EQ(escaped, 0);
-    none = 5;
-    EXPECT_EQ(lew_dispatch_once(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
-    EXPECT_EQ(lew_dispatch(nullptr, &none, &escaped), LC_NULL);
-    EXPECT_EQ(none, 0);
-}
-
-TEST_F(Loop, ATimerFiresOnceAndIsThenNoEventAnyMore) {
-    timer only;
+TEST_F(Loop, EndsWhenNothingIsRegistered) {
+    EXPECT_EQ(whole(), "no events");
+    EXPECT_EQ(once(), "no events");
+    timer only; // no event any more once it has fired
     only.start(loop, 30);
     const double start = now_seconds();
-    int none = 0;
-    EXPECT_EQ(lew_dispatch(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
+    EXPECT_EQ(whole(), "no events");
     EXPECT_EQ(only.runs, 1);
     EXPECT_GE(now_seconds() - start, 0.025);
+    readable gone; // not even open any more: it shows, and takes itself away
+    gone.start(loop);
+    gone.closed = close(gone.ends[0]) == 0;
+    gone.action = [&] { loop_event_free(&gone.event); };
+    EXPECT_EQ(whole(), "no events");
+    EXPECT_EQ(gone.runs, 1);
+    int none = 5;
+    EXPECT_EQ(lew_dispatch(nullptr, &none, nullptr), LC_NULL);
+    EXPECT_EQ(none, 0);
+    std::thread([&] { EXPECT_EQ(whole() + once(), "1400214002"); }).join(); // the owner's alone
 }
 
-TEST_F(Loop, EscapeIsStickyAndWaitsForNothing) {
-    readable idle;
-    idle.start(loop);
-    EXPECT_EQ(lew_escape_from_dispatch(wrapper), LC_OK);
-    for (int i = 0; i < 2; i++) {
-        int none = 1, escaped = 0;
-        EXPECT_EQ(i ? lew_dispatch_once(wrapper, &none, &escaped) : lew_dispatch(wrapper, &none, &escaped),
-                  LC_OK);
-        EXPECT_EQ(none, 0);
-        EXPECT_EQ(escaped, 1);
-    }
-    EXPECT_EQ(idle.runs, 0);
+TEST_F(Loop, AnEscapeIsStickyAndEndsEachDepthAtOnce) {
+    readable first, second;
+    timer inner;
+    second.action = [&] {
+        inner.start(loop, 1);
+        inner.action = [&] { escape(); };
+        EXPECT_EQ(once(), "escaped");
+        EXPECT_EQ(once(), "escaped");
+    };
+    first.action = [&] {
+        second.start(loop);
+        EXPECT_EQ(once(), "escaped"); // with the wait inside
+    };
+    first.start(loop);
+    EXPECT_EQ(whole(), "escaped");
+    EXPECT_EQ(first.runs + second.runs, 2);
+    first.fill();
+    EXPECT_EQ(whole(), "escaped");
+    EXPECT_EQ(once(), "escaped");
+    EXPECT_EQ(first.runs + second.runs, 2);
 }
 
-TEST_F(Loop, EscapeInACallbackEndsTheRoundBeforeTheNextCallback) {
+TEST_F(Loop, AnEscapeInACallbackEndsTheRoundBeforeTheNextOne) {
     readable first, second;
     first.start(loop);
     second.start(loop);
-    const auto leave = [&] { EXPECT_EQ(lew_escape_from_dispatch(wrapper), LC_OK); };
-    first.action = second.action = leave;
-    int escaped = 0;
-    EXPECT_EQ(lew_dispatch(wrapper, nullptr, &escaped), LC_OK);
-    EXPECT_EQ(escaped, 1);
+    first.action = second.action = [&] { escape(); };
+    EXPECT_EQ(whole(), "escaped");
     EXPECT_EQ(first.runs + second.runs, 1);
 }
 
@@ -138,19 +154,15 @@ TEST_F(Loop, WaitsNestToAnyDepth) {
     int inside = 0, deepest = 0;
     for (readable &each : events) {
         each.action = [&] {
-            inside++;
-            deepest = std::max(deepest, inside);
+            deepest = std::max(deepest, ++inside);
             if (deepest < depth) {
-                int none = 1, escaped = 1;
-                EXPECT_EQ(lew_dispatch_once(wrapper, &none, &escaped), LC_OK);
-                EXPECT_EQ(none, 0);
-                EXPECT_EQ(escaped, 0);
+                EXPECT_EQ(once(), "ran");
             }
             inside--;
         };
         each.start(loop);
     }
-    EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
+    EXPECT_EQ(once(), "ran");
     EXPECT_EQ(deepest, depth);
     for (readable &each : events)
         EXPECT_EQ(each.runs, 1);
@@ -160,35 +172,16 @@ TEST_F(Loop, ANestedWaitFindsWhatBecomesReadyMeanwhile) {
     readable outer, later;
     timer due;
     later.start(loop);
-    EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
+    EXPECT_EQ(once(), "ran");
     outer.action = [&] {
         due.start(loop, 20);
         due.action = [&] { later.fill(); };
         while (later.runs < 2)
-            ASSERT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
+            ASSERT_EQ(once(), "ran");
     };
     outer.start(loop);
-    EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
+    EXPECT_EQ(once(), "ran");
     EXPECT_EQ(outer.runs, 1);
-    EXPECT_EQ(later.runs, 2);
-}
-
-TEST_F(Loop, AnEscapeInsideEndsEachDepthAtOnce) {
-    readable outer;
-    timer inner;
-    int inner_escaped = 0, again = 0;
-    outer.action = [&] {
-        inner.start(loop, 1);
-        EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, &inner_escaped), LC_OK);
-        EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, &again), LC_OK);
-    };
-    inner.action = [&] { EXPECT_EQ(lew_escape_from_dispatch(wrapper), LC_OK); };
-    outer.start(loop);
-    int escaped = 0;
-    EXPECT_EQ(lew_dispatch(wrapper, nullptr, &escaped), LC_OK);
-    EXPECT_EQ(inner_escaped, 1);
-    EXPECT_EQ(again, 1);
-    EXPECT_EQ(escaped, 1);
 }
 
 // Two events ready in one round; whichever comes first takes the other away, by each way of doing so.
@@ -196,171 +189,117 @@ TEST_F(Loop, AnEventTakenAwayByAnEarlierCallbackNeverRuns) {
     for (int way = 0; way < 3; way++) {
         readable pair[2];
         const auto take_away = [&, way](int other) {
+            if (way == 1)
+                return loop_event_free(&pair[other].event);
+            loop_event_remove(pair[other].event);
             if (way == 0)
-                loop_event_remove(pair[other].event);
-            else if (way == 1)
-                loop_event_free(&pair[other].event);
-            else { // taken away by a callback of a nested round
-                timer nested;
-                nested.start(loop, 0);
-                nested.action = [&, other] { loop_event_free(&pair[other].event); };
-                loop_event_remove(pair[other].event);
-                EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
-            }
+                return;
+            timer nested; // freed by a callback of a nested round
+            nested.start(loop, 0);
+            nested.action = [&, other] { loop_event_free(&pair[other].event); };
+            EXPECT_EQ(once(), "ran");
         };
         pair[0].action = [&] { take_away(1); };
         pair[1].action = [&] { take_away(0); };
         pair[0].start(loop);
         pair[1].start(loop);
-        EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
+        EXPECT_EQ(once(), "ran");
         EXPECT_EQ(pair[0].runs + pair[1].runs, 1) << way;
     }
 }
 
-TEST_F(Loop, AnEventMayFreeItself) {
-    readable self;
-    self.action = [&] { loop_event_free(&self.event); };
-    self.start(loop);
-    int none = 0;
-    EXPECT_EQ(lew_dispatch(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
-    EXPECT_EQ(self.runs, 1);
-}
-
-TEST_F(Loop, AClosedPipeIsReadable) {
-    int ends[2];
-    ASSERT_EQ(pipe(ends), 0);
-    struct seen {
-        int runs = 0;
-        loop_event *event = nullptr;
-    } watch;
-    const auto fired = [](int, short, void *data) {
-        auto *self = static_cast<seen *>(data);
-        self->runs++;
-        loop_event_free(&self->event);
-    };
-    ASSERT_EQ(loop_event_new(loop, fired, &watch, &watch.event), LC_OK);
-    ASSERT_EQ(loop_event_set_fd(watch.event, ends[0], LOOP_READ), LC_OK);
-    close(ends[0]); // not even open any more
-    EXPECT_EQ(lew_dispatch(wrapper, nullptr, nullptr), LC_OK);
-    EXPECT_EQ(watch.runs, 1);
-    close(ends[1]);
-}
-
-TEST_F(Loop, OnlyTheOwnerDispatches) {
-    lc_status status = LC_OK, once = LC_OK;
-    std::thread([&] {
-        status = lew_dispatch(wrapper, nullptr, nullptr);
-        once = lew_dispatch_once(wrapper, nullptr, nullptr);
-    }).join();
-    EXPECT_EQ(status, LC_ASSERTION);
-    EXPECT_EQ(once, LC_ASSERTION);
-}
-
 // ---- Signals
 
-struct signal_log {
+struct Signals : Loop {
     std::vector<int> numbers;
     std::function<void()> action;
     lc_status result = LC_OK;
+    lew_event *slots[2] = {};
     static lc_status take(int number, short flags, void *data, lew *) {
-        auto *self = static_cast<signal_log *>(data);
+        auto *self = static_cast<Signals *>(data);
         EXPECT_EQ(flags, LOOP_SIGNAL);
         self->numbers.push_back(number);
         if (self->action)
             self->action();
         return self->result;
     }
+    lc_status reg(lew *context, lew_event **slot, int number) {
+        return lew_event_reg_signal(context, slot, number, take, this);
+    }
 };
 
-TEST_F(Loop, SignalsAreCallbacksInTheLoop) {
-    signal_log log;
-    log.result = LC_GENERIC; // logged, and the loop goes on
-    lew_event *slots[2] = {};
-    ASSERT_EQ(lew_event_reg_signal(wrapper, &slots[0], SIGUSR1, signal_log::take, &log), LC_OK);
-    ASSERT_EQ(lew_event_reg_signal(wrapper, &slots[1], SIGUSR2, signal_log::take, &log), LC_OK);
+TEST_F(Signals, AreCallbacksInTheLoop) {
+    result = LC_GENERIC; // logged, and the loop goes on
+    ASSERT_EQ(reg(wrapper, &slots[0], SIGUSR1), LC_OK);
+    ASSERT_EQ(reg(wrapper, &slots[1], SIGUSR2), LC_OK);
     raise(SIGUSR1);
-    EXPECT_TRUE(log.numbers.empty()); // blocked outside the wait
-    EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
+    EXPECT_TRUE(numbers.empty()); // blocked outside the wait
+    EXPECT_EQ(once(), "ran");
     raise(SIGUSR2);
     raise(SIGUSR1);
-    while (log.numbers.size() < 3)
-        ASSERT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
-    EXPECT_EQ(log.numbers[0], SIGUSR1);
-    EXPECT_EQ(log.numbers[1] + log.numbers[2], SIGUSR1 + SIGUSR2);
-    EXPECT_EQ(lew_event_delete(wrapper, &slots[0]), LC_OK);
-    EXPECT_EQ(slots[0], nullptr);
-    EXPECT_EQ(lew_event_delete(wrapper, &slots[0]), LC_OK);
+    while (numbers.size() < 3)
+        ASSERT_EQ(once(), "ran");
+    EXPECT_EQ(numbers[0], SIGUSR1);
+    EXPECT_EQ(numbers[1] + numbers[2], SIGUSR1 + SIGUSR2);
+    for (int i = 0; i < 2; i++) {
+        EXPECT_EQ(lew_event_delete(wrapper, &slots[0]), LC_OK);
+        EXPECT_EQ(slots[0], nullptr);
+    }
     EXPECT_EQ(le_signal_context(SIGUSR1), nullptr);
     EXPECT_EQ(le_signal_context(SIGUSR2), loop);
+    // One ends a wait.
+    const pthread_t self = pthread_self();
+    std::thread sender([&] {
+        usleep(50000);
+        pthread_kill(self, SIGUSR2);
+    });
+    const double start = now_seconds();
+    EXPECT_EQ(once(), "ran");
+    EXPECT_LT(now_seconds() - start, 2);
+    sender.join();
     EXPECT_EQ(lew_delete_all_events(wrapper), LC_OK);
     EXPECT_EQ(slots[1], nullptr);
-    int none = 0;
-    EXPECT_EQ(lew_dispatch(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
+    EXPECT_EQ(whole(), "no events");
 }
 
 // The exit deletes the registrations from inside one of them; a second SIGTERM then does not kill the
 // process.
-TEST_F(Loop, AllSignalsMayGoInsideTheCallbackOfOne) {
-    signal_log log;
-    lew_event *slots[2] = {};
-    ASSERT_EQ(lew_event_reg_signal(wrapper, &slots[0], SIGTERM, signal_log::take, &log), LC_OK);
-    ASSERT_EQ(lew_event_reg_signal(wrapper, &slots[1], SIGINT, signal_log::take, &log), LC_OK);
+TEST_F(Signals, AllMayGoInsideTheCallbackOfOne) {
+    ASSERT_EQ(reg(wrapper, &slots[0], SIGTERM), LC_OK);
+    ASSERT_EQ(reg(wrapper, &slots[1], SIGINT), LC_OK);
     raise(SIGTERM);
     raise(SIGINT);
-    log.action = [&] {
+    action = [&] {
         EXPECT_EQ(lew_event_delete(wrapper, &slots[0]), LC_OK);
         EXPECT_EQ(lew_event_delete(wrapper, &slots[1]), LC_OK);
         raise(SIGTERM);
     };
-    int none = 0;
-    EXPECT_EQ(lew_dispatch(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
-    EXPECT_EQ(log.numbers.size(), 1u);
+    EXPECT_EQ(whole(), "no events");
+    EXPECT_EQ(numbers.size(), 1u);
 }
 
-TEST_F(Loop, ASignalIsOneContextsAndItsNumberIsChecked) {
-    signal_log log;
-    lew_event *slot = nullptr, *foreign = nullptr, *bad = nullptr;
-    ASSERT_EQ(lew_event_reg_signal(wrapper, &slot, SIGUSR1, signal_log::take, &log), LC_OK);
+TEST_F(Signals, AreOneContextsAndTheirNumberIsChecked) {
     lew *other = nullptr;
+    lew_event *slot = nullptr, *foreign = nullptr, *bad = nullptr;
     ASSERT_EQ(lew_init(&other), LC_OK);
-    EXPECT_EQ(lew_event_reg_signal(other, &foreign, SIGUSR1, signal_log::take, &log), LC_ASSERTION);
+    ASSERT_EQ(reg(wrapper, &slot, SIGUSR1), LC_OK);
+    EXPECT_EQ(reg(other, &foreign, SIGUSR1), LC_ASSERTION);
     EXPECT_EQ(foreign, nullptr);
-    for (int number : {0, -1, 66})
-        EXPECT_EQ(lew_event_reg_signal(wrapper, &bad, number, signal_log::take, &log), LC_ASSERTION);
-    EXPECT_EQ(lew_event_reg_signal(nullptr, &bad, SIGUSR2, signal_log::take, &log), LC_NULL);
-    EXPECT_EQ(lew_event_reg_signal(wrapper, &bad, SIGUSR2, nullptr, &log), LC_NULL);
+    for (const int number : {0, -1, 66})
+        EXPECT_EQ(reg(wrapper, &bad, number), LC_ASSERTION);
+    EXPECT_EQ(reg(nullptr, &bad, SIGUSR2), LC_NULL);
     EXPECT_EQ(bad, nullptr);
     // A filled slot is registered anew, but only where it is known.
-    EXPECT_EQ(lew_event_reg_signal(other, &slot, SIGUSR2, signal_log::take, &log), LC_NOT_FOUND);
+    EXPECT_EQ(reg(other, &slot, SIGUSR2), LC_NOT_FOUND);
     EXPECT_EQ(lew_event_delete(other, &slot), LC_NOT_FOUND);
-    EXPECT_EQ(lew_event_reg_signal(wrapper, &slot, SIGUSR2, signal_log::take, &log), LC_OK);
+    EXPECT_EQ(reg(wrapper, &slot, SIGUSR2), LC_OK);
     EXPECT_EQ(le_signal_context(SIGUSR1), nullptr);
-    EXPECT_EQ(lew_event_reg_signal(other, &foreign, SIGUSR1, signal_log::take, &log), LC_OK);
+    EXPECT_EQ(reg(other, &foreign, SIGUSR1), LC_OK);
     EXPECT_EQ(lew_event_cancel(other, &foreign), LC_OK);
     EXPECT_EQ(lew_event_cancel(other, &foreign), LC_OK);
     EXPECT_NE(foreign, nullptr);
     EXPECT_EQ(lew_deinit(&other), LC_OK);
     EXPECT_EQ(foreign, nullptr);
-    EXPECT_EQ(lew_delete_all_events(wrapper), LC_OK);
-}
-
-TEST_F(Loop, ASignalEndsAWait) {
-    signal_log log;
-    lew_event *slot = nullptr;
-    ASSERT_EQ(lew_event_reg_signal(wrapper, &slot, SIGUSR1, signal_log::take, &log), LC_OK);
-    const pthread_t self = pthread_self();
-    std::thread sender([&] {
-        usleep(50000);
-        pthread_kill(self, SIGUSR1);
-    });
-    const double start = now_seconds();
-    EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
-    EXPECT_LT(now_seconds() - start, 2);
-    EXPECT_EQ(log.numbers.size(), 1u);
-    sender.join();
     EXPECT_EQ(lew_delete_all_events(wrapper), LC_OK);
 }
 
