@@ -109,8 +109,7 @@ struct pending_command {
     bool answered;
 };
 
-// The way of each command: its code, whether it carries a tunnel or an L2 return, and the line that tells
-// of its time-out.
+// Each command, and the line that tells of its time-out.
 struct command_kind {
     uint16_t code;
     int32_t time_out_level;

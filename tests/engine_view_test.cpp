@@ -170,6 +170,7 @@ TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     EXPECT_EQ(report(ROUTER_A, {{US, 150}, {host(2), 300}, {host(4), 1}}), 1);
     EXPECT_EQ(router(ROUTER_A)->view_appliance_count, 2u);
     EXPECT_EQ(router(ROUTER_A)->view_appliances[0].weight, 100);
+    EXPECT_EQ(group->assign_timer.active + group->pending_acks, 0);
 }
 
 // Elements of a Router View, as they stand on the wire.
