@@ -119,12 +119,6 @@ TEST(Arrays, CopiesAndWholes) {
     EXPECT_FALSE(tstr_array_equal(list, copy));
     EXPECT_EQ(tstr_array_concat(list, copy), LC_OK);
     EXPECT_TRUE(tstr_array_length_quick(list) == 8 && tstr_array_length_quick(copy) == 0);
-    char *given = strdup("taken");
-    EXPECT_EQ(tstr_array_append_str_takeover(list, &given), LC_OK);
-    EXPECT_EQ(given, nullptr);
-    EXPECT_EQ(tstr_array_insert_str(list, 0, "first"), LC_OK);
-    EXPECT_STREQ(tstr_array_get_str_quick(list, 9), "taken");
-    EXPECT_STREQ(tstr_array_get_str_quick(list, 0), "first");
 }
 
 static lc_status steer(uint32_array *, uint32_t, uint32_t, void *data) {
@@ -328,7 +322,7 @@ static lc_status split(const char *name, tstr_array **out, int *out_absolute) {
     return ts_tokenize_str(name, '/', 0, 0, ts_tok_skip_leading, out);
 }
 static int values_freed;
-TEST(Tree, PathsWildcardsAndChildren) {
+TEST(Tree, PathsAndWildcards) {
     tree_options options;
     ASSERT_EQ(tree_options_get_defaults(&options), LC_OK);
     options.name_to_parts = split;
@@ -339,26 +333,22 @@ TEST(Tree, PathsWildcardsAndChildren) {
     tree_node *node = nullptr, *star = nullptr;
     EXPECT_EQ(tree_set_node_value_by_path_str(whole, nullptr, "/a/*", &value[0], 0, &node), LC_TREE_NO_PATH);
     EXPECT_EQ(tree_set_node_value_by_path_str(whole, nullptr, "/a/*", &value[0], 1, &star), LC_OK);
-    EXPECT_EQ(tree_set_node_value_by_path_str(whole, nullptr, "/a/z", &value[1], 1, nullptr), LC_OK);
-    EXPECT_EQ(tree_set_node_value_by_path_str(whole, nullptr, "/a/b", &value[2], 1, nullptr), LC_OK);
-    EXPECT_EQ(tree_set_node_value_by_path_str(whole, nullptr, "/a/b", &value[3], 1, nullptr), LC_OK);
+    for (int i = 1; i < 4; i++) // the last takes the place of the one before
+        EXPECT_EQ(
+            tree_set_node_value_by_path_str(whole, nullptr, i == 1 ? "/a/z" : "/a/b", &value[i], 1, nullptr),
+            LC_OK);
     EXPECT_EQ(values_freed, 1);
-
     strings_owner parts;
     ASSERT_EQ(ts_tokenize_str("a/x", '/', 0, 0, 0, &parts), LC_OK);
     EXPECT_TRUE(tree_get_node_by_path_wildcarded(whole, nullptr, parts, "*", &node) == LC_OK && node == star);
     EXPECT_EQ(tree_get_node_by_path_wildcarded(whole, nullptr, parts, nullptr, &node), LC_NOT_FOUND);
     EXPECT_EQ(node, nullptr);
-    ASSERT_EQ(ts_tokenize_str("b", '/', 0, 0, 0, &parts), LC_OK);
-    tree_node *a = static_cast<tree_node *>(array_get_quick(whole->root->children, 0));
-    ASSERT_EQ(tree_get_node_by_path_wildcarded(whole, a, parts, "*", &node), LC_OK);
-    void *found = nullptr;
-    EXPECT_TRUE(tree_node_get_value(whole, node, &found) == LC_OK && found == &value[3]);
     std::string names;
     const auto collect = [](tree *, tree_node *, const char *name, void *, void *data) -> lc_status {
         *static_cast<std::string *>(data) += name;
         return LC_OK;
     };
+    auto *a = static_cast<tree_node *>(array_get_quick(whole->root->children, 0));
     EXPECT_EQ(tree_foreach(whole, a, 0, collect, &names), LC_OK);
     EXPECT_EQ(names, "*bz");
     whole.reset();
