@@ -122,6 +122,9 @@ lc_status wccpd_pid_init() {
 lc_status wccpd_serv_init() {
     CHECK_CONDITION(wccpd_lwc != nullptr);
     wccpd_engine_begun = true;
+    // The engine's threads order tunnels as soon as the first group has its router, which can be while the
+    // configuration is still read: the ids stand before. wccpd_init tells them when it is through.
+    (void)qv_encap_setup_entries();
     return wccp_init_mgr();
 }
 
@@ -193,8 +196,12 @@ lc_status wccpd_deinit() {
 
 int wccpd_main() {
     (void)mlockall(MCL_CURRENT | MCL_FUTURE);
-    // All mapped memory is locked, and each thread that allocates would map an arena of 64 MB of its own.
+    // All mapped memory is locked. Each thread that allocates would map an arena of 64 MB of its own; and by
+    // default malloc keeps on the heap what is as large as anything freed before, which the buffers of the
+    // start's answers make some megabytes.
     (void)mallopt(M_ARENA_MAX, 1);
+    (void)mallopt(M_MMAP_THRESHOLD, 128 << 10);
+    (void)mallopt(M_TRIM_THRESHOLD, 128 << 10);
     const lc_status first = lc_init();
     if (first != LC_OK) {
         LOG_STATUS(first);

@@ -69,10 +69,9 @@ role() { # APPLIANCE SECONDS GROUP ROLE
 says() { # APPLIANCE SECONDS LINE (extended regular expression)
     lab_wait_log "$2" "$1" "$3" || die "log of $1"
 }
-# What the appliance itself says of a group: the nodes below its state as an object of name and value.
+# What the appliance itself says of a group, as nested objects: .oper, .router["1"].state
 group_is() { # APPLIANCE SECONDS GROUP JQ
-    lab_wait "$2" "([.[] | {key: (.name | sub(\"^/qv/wccpd/wccp/srv_grp/state/$3/?\"; \"\")), value}] | from_entries) as \$g | $4" \
-        lab_manage "$1" walk "/qv/wccpd/wccp/srv_grp/state/$3" || die "group $3 of $1"
+    lab_wait "$2" "$4" lab_state "$1" "$3" || die "group $3 of $1"
 }
 configure() { # APPLIANCE [TEXT]...
     lab_configure "$@" || die "configuration of $1"

@@ -48,6 +48,7 @@
 #   LAB_SPEED   how many of its seconds the protocol gets into one (default 1); wccpd, tunneld and wccp_router run by
 #               that clock (lab/fast_clock.cpp), mgmtd and mgmtctl, whose limits are about work, by the wall's.
 #               SECONDS of all functions here are the wall's, but for lab_sleep, which sleeps for the protocol's.
+#   LAB_TUNNELD     options of tunneld that lab_appliance_start gives; "none" starts none
 #   LAB_LOG_LEVEL   of wccpd, in the configuration that lab_appliance_start writes (default info)
 
 LAB_HOME=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
@@ -311,7 +312,8 @@ lab_appliance_start() { # NODE [TEXT]...
     lab_write_config "$@" || lab_die "no configuration for $node"
     LAB_FOUND[$node]=$(lab_remains "$node")
     lab_mgmtd_start "$node"
-    lab_start "$node" tunneld tunneld
+    # shellcheck disable=SC2086
+    [ "${LAB_TUNNELD-}" = none ] || lab_start "$node" tunneld tunneld ${LAB_TUNNELD-}
     lab_wccpd_start "$node"
 }
 lab_mgmtd_start() { # NODE
@@ -394,7 +396,7 @@ lab_manage() { # NODE WORDS...
 # "appliance": {"1": {"ipaddr": ..., "weight": ...}}, ...}}: nodes by the parts of their names.
 lab_state() { # NODE [GROUP]
     lab_manage "$1" walk "/qv/wccpd/wccp/srv_grp/state${2:+/$2}" 2>/dev/null | jq -c --arg group "${2-}" '
-        map(.name) as $names | map(select((.name + "/") as $above | all($names[]; startswith($above) | not))) |
+        (arrays // []) | map(.name) as $names | map(select((.name + "/") as $above | all($names[]; startswith($above) | not))) |
         reduce .[] as $node ({}; setpath($node.name | split("/")[6:]; $node.value)) |
         if $group == "" then . else .[$group] | objects // {} end'
 }

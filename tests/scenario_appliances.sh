@@ -26,8 +26,8 @@ case_five() {
     for n in 1 2 3 4 5; do appliance a$n 10.0.0.10$n "$(hash_group ${weights[n - 1]})"; done
     for n in 1 2 3 4 5; do router_is r1 40 51 "$(shares 10.0.0.10$n $((weights[n - 1] * 8 / 5)))"; done
     router_is r2 5 51 "$(shares 10.0.0.105 96)"
-    group_is a1 5 51 '$g.oper == "ACTIVE, DESIGNATED" and $g.num_appliances == 5'
-    group_is a5 15 51 '$g.oper == "ACTIVE" and $g["router/1/appliance/10.0.0.105/load_dist"] == 37'
+    group_is a1 5 51 '.oper == "ACTIVE, DESIGNATED" and .num_appliances == 5'
+    group_is a5 15 51 '.oper == "ACTIVE" and .router["1"].appliance["10.0.0.105"].load_dist == 37'
 
     # 120 in all: the runs end at 256 times the sums of 10, 20, 30, 40 and 20 by 120, rounded down.
     configure a5 "$(hash_group 20)"
@@ -51,7 +51,7 @@ case_five_by_mask() {
         appliance a$n 10.0.0.10$n "$(lab_group 51 10.0.0.1 compatibility=nexus mask_dst_ip=0 mask_src_ip=0x1f weight=$((n * 10)))"
     done
     router_is r1 40 51 '[$g.appliances[].values] == [2, 4, 6, 9, 11]'
-    group_is a1 10 51 '$g["router/1/assign_method"] == "MASK"'
+    group_is a1 10 51 '.router["1"].assign_method == "MASK"'
     finish a1 a2 a3 a4 a5
 }
 
@@ -62,14 +62,14 @@ case_takeover() {
     appliance a1 10.0.0.101 "$(hash_group 100)"
     appliance a2 10.0.0.102 "$(hash_group 100)"
     router_is r1 30 51 "\$g.assignment.key == \"10.0.0.101\" and ($(shares 10.0.0.102 128))"
-    group_is a1 10 51 '$g.oper == "ACTIVE, DESIGNATED"'
-    group_is a2 10 51 '$g.oper == "ACTIVE"'
+    group_is a1 10 51 '.oper == "ACTIVE, DESIGNATED"'
+    group_is a2 10 51 '.oper == "ACTIVE"'
     lab_kill a1
     router_is r2 20 51 "\$g.assignment.key == \"10.0.0.102\" and ($(shares 10.0.0.102 256))"
-    group_is a2 10 51 '$g.oper == "ACTIVE, DESIGNATED" and $g["router/1/appliance/10.0.0.102/load_dist"] == 100'
+    group_is a2 10 51 '.oper == "ACTIVE, DESIGNATED" and .router["1"].appliance["10.0.0.102"].load_dist == 100'
     appliance a1 10.0.0.101 "$(hash_group 100)"
     router_is r2 30 51 "\$g.assignment.key == \"10.0.0.101\" and ($(shares 10.0.0.101 128))"
-    group_is a2 10 51 '$g.oper == "ACTIVE"'
+    group_is a2 10 51 '.oper == "ACTIVE"'
     # The designated one goes in order: the other takes over without the wait for its silence.
     lab_end a1 || die "the end of a1"
     router_is r1 12 51 "\$g.assignment.key == \"10.0.0.102\" and ($(shares 10.0.0.102 256))"
