@@ -177,17 +177,24 @@ TEST_F(Tunnels, ACancelledDeleteStillTakesTheTunnelOut) {
     EXPECT_EQ(commands()[0].tunnel_id, g_qv_encap_wccp_first) << "its id is free";
 }
 
-// Tunnels come and go on several threads while all are deleted, as at exit.
+// Tunnels come and go on several threads while all are deleted, as at exit: commands don't overlap, and each
+// gets the answer to its own.
 TEST_F(Tunnels, DeletingAllWhileOthersAddAndDelete) {
     std::atomic<bool> stop = false;
+    std::atomic<int> torn = 0;
+    tunneld.answer_with([&torn](const seen_command &command) {
+        const uint32_t index = command.code == MAILBOX_ADD_TUNNEL ? WCCP_NO_INDEX : 1000u + command.tunnel_id;
+        torn += command.index != index || command.local != 0x0A000001 || command.remote >> 8 != 0x0A0001;
+        return tunneld_does(command);
+    });
     std::vector<std::thread> others;
     for (uint32_t other = 0; other < 3; other++)
-        others.emplace_back([other, &stop] {
+        others.emplace_back([other, &stop, &torn] {
             while (!stop) {
                 for (uint32_t i = 0; i < 8; i++)
-                    wccp_add_tunnel(other, self, router(100 + other * 20 + i));
+                    torn += wccp_add_tunnel(other, self, router(100 + other * 20 + i)) != 0;
                 for (uint32_t i = 0; i < 8; i++)
-                    wccp_del_tunnel(other, self, router(100 + other * 20 + i), 0);
+                    torn += wccp_del_tunnel(other, self, router(100 + other * 20 + i), 0) != 0;
             }
         });
     for (int i = 0; i < 10; i++)
@@ -195,4 +202,5 @@ TEST_F(Tunnels, DeletingAllWhileOthersAddAndDelete) {
     stop = true;
     for (std::thread &other : others)
         other.join();
+    EXPECT_EQ(torn, 0);
 }

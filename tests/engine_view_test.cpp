@@ -134,23 +134,25 @@ TEST_F(ViewTest, TheSameReportInAnyOrderIsNoChange) {
 TEST_F(ViewTest, ARouterIsTwoWayWhileItListsUs) {
     group->ucast_router_count = 1;
     wccp_g.seconds = 100;
-    wccp_sending_router *a = router(ROUTER_A);
-    EXPECT_EQ(a->flags, WCCP_RTR_ONE_WAY);
-    wccp_g.seconds = 110;
-    report(ROUTER_A, {{host(2), 100}});
-    EXPECT_EQ(a->flags, WCCP_RTR_ONE_WAY);
-    EXPECT_EQ(a->state_time, 100u);
-    report(ROUTER_A, {{host(2), 100}, {US, 100}});
-    EXPECT_EQ(a->flags, WCCP_RTR_TWO_WAY);
-    EXPECT_EQ(a->state_time, 110u);
-    wccp_g.seconds = 120;
-    report(ROUTER_A, {{host(2), 100}, {US, 100}});
-    EXPECT_EQ(a->state_time, 110u);
-    EXPECT_EQ(group->raised_alarms, 0);
-    report(ROUTER_A, {{host(2), 100}});
-    EXPECT_EQ(a->flags, WCCP_RTR_ONE_WAY);
-    EXPECT_EQ(a->state_time, 120u);
-    EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ADJACENCY);
+    const wccp_sending_router *a = router(ROUTER_A);
+    const struct {
+        reported_appliances list;
+        uint32_t flags, state_time;
+        uint16_t alarms;
+    } steps[] = {
+        {{}, WCCP_RTR_ONE_WAY, 100, 0},
+        {{{host(2), 1}}, WCCP_RTR_ONE_WAY, 100, 0},
+        {{{host(2), 1}, {US, 1}}, WCCP_RTR_TWO_WAY, 120, 0},
+        {{{host(2), 1}, {US, 1}}, WCCP_RTR_TWO_WAY, 120, 0},
+        {{{host(2), 1}}, WCCP_RTR_ONE_WAY, 140, WCCP_ALARM_ADJACENCY},
+    };
+    for (const auto &step : steps) {
+        report(ROUTER_A, step.list);
+        EXPECT_EQ(a->flags, step.flags);
+        EXPECT_EQ(a->state_time, step.state_time);
+        EXPECT_EQ(group->raised_alarms, step.alarms);
+        wccp_g.seconds += 10;
+    }
     wccp_g.seconds = 0;
 }
 

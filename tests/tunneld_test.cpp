@@ -70,13 +70,6 @@ struct Tunneld : testing::Test {
         fclose(out);
         free(text);
     }
-    // One command through the daemon; its status.
-    uint32_t done(uint16_t code, uint16_t id, uint32_t remote) {
-        give(code, id, remote);
-        EXPECT_TRUE(tunneld_step(&daemon));
-        EXPECT_EQ(mailbox->command, 0);
-        return mailbox->status;
-    }
     // The lines since the last call.
     std::string lines() {
         fflush(out);
@@ -147,56 +140,58 @@ TEST(Mailbox, ABlockThatIsTooShortIsNotUsed) {
     EXPECT_EQ(status, 0);
 }
 
-TEST_F(Tunneld, KeepsATableOfItsTunnels) {
-    tunneld_start(&daemon, {.first_index = 7}, out);
-    EXPECT_FALSE(tunneld_step(&daemon)) << "nothing to do";
-    mailbox->l2_group = 51;
-    mailbox->l2_value = 1;
-    static const struct {
+TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
+    const tunneld_options does = {.first_index = 7}, refuses = {.refuse = true},
+                          without_index = {.first_index = WCCP_NO_INDEX}, is_silent = {.silent = true};
+    const struct {
+        const tunneld_options *options; // of a daemon that starts here
         uint16_t code, id;
         uint32_t remote, status, index; // index: what the mailbox holds then
         std::string line;
     } steps[] = {
-        {MAILBOX_ADD_TUNNEL, 300, 2, 0, 7, "add tunnel 300 10.0.0.1 <=> 10.0.0.2 index 7: done"},
-        {MAILBOX_ADD_TUNNEL, 301, 3, 0, 8, "add tunnel 301 10.0.0.1 <=> 10.0.0.3 index 8: done"},
+        {&does, MAILBOX_ADD_TUNNEL, 300, 2, 0, 7, "add tunnel 300 10.0.0.1 <=> 10.0.0.2 index 7: done\n"},
+        {nullptr, MAILBOX_ADD_TUNNEL, 301, 3, 0, 8, "add tunnel 301 10.0.0.1 <=> 10.0.0.3 index 8: done\n"},
         // Given again.
-        {MAILBOX_ADD_TUNNEL, 300, 2, 0, 7, "add tunnel 300 10.0.0.1 <=> 10.0.0.2 index 7: done"},
+        {nullptr, MAILBOX_ADD_TUNNEL, 300, 2, 0, 7, "add tunnel 300 10.0.0.1 <=> 10.0.0.2 index 7: done\n"},
         // The same ends under another id, and another tunnel under an id: what was there is replaced.
-        {MAILBOX_ADD_TUNNEL, 305, 2, 0, 9, "add tunnel 305 10.0.0.1 <=> 10.0.0.2 index 9: done"},
-        {MAILBOX_ADD_TUNNEL, 301, 9, 0, 10, "add tunnel 301 10.0.0.1 <=> 10.0.0.9 index 10: done"},
-        {MAILBOX_DELETE_TUNNEL, 305, 2, 0, 9, "delete tunnel 305 10.0.0.1 <=> 10.0.0.2 index 9: done"},
-        {MAILBOX_DELETE_TUNNEL, 305, 2, 1, WCCP_NO_INDEX,
-         "delete tunnel 305 10.0.0.1 <=> 10.0.0.2 index none: no such tunnel"},
-        {MAILBOX_L2_RETURN, 0, 0, 0, WCCP_NO_INDEX, "L2 return group 51 value 1: done"},
-        {9, 0, 0, 1, WCCP_NO_INDEX, "unknown command 9: refused"},
+        {nullptr, MAILBOX_ADD_TUNNEL, 305, 2, 0, 9, "add tunnel 305 10.0.0.1 <=> 10.0.0.2 index 9: done\n"},
+        {nullptr, MAILBOX_ADD_TUNNEL, 301, 9, 0, 10, "add tunnel 301 10.0.0.1 <=> 10.0.0.9 index 10: done\n"},
+        {nullptr, MAILBOX_DELETE_TUNNEL, 305, 2, 0, 9,
+         "delete tunnel 305 10.0.0.1 <=> 10.0.0.2 index 9: done\n"},
+        {nullptr, MAILBOX_DELETE_TUNNEL, 305, 2, 1, WCCP_NO_INDEX,
+         "delete tunnel 305 10.0.0.1 <=> 10.0.0.2 index none: no such tunnel\n"},
+        {nullptr, MAILBOX_DELETE_TUNNEL, 300, 2, 1, WCCP_NO_INDEX,
+         "delete tunnel 300 10.0.0.1 <=> 10.0.0.2 index none: no such tunnel\n"},
+        {nullptr, MAILBOX_L2_RETURN, 0, 0, 0, WCCP_NO_INDEX, "L2 return group 51 value 1: done\n"},
+        {nullptr, 9, 0, 0, 1, WCCP_NO_INDEX, "unknown command 9: refused\n"},
+        {&refuses, MAILBOX_ADD_TUNNEL, 306, 2, 1, WCCP_NO_INDEX,
+         "add tunnel 306 10.0.0.1 <=> 10.0.0.2 index none: refused\n"},
+        {nullptr, MAILBOX_L2_RETURN, 0, 0, 1, WCCP_NO_INDEX, "L2 return group 51 value 1: refused\n"},
+        {&without_index, MAILBOX_ADD_TUNNEL, 306, 2, 0, WCCP_NO_INDEX,
+         "add tunnel 306 10.0.0.1 <=> 10.0.0.2 index none: done, without an index\n"},
+        {&is_silent, MAILBOX_ADD_TUNNEL, 306, 2, 77, WCCP_NO_INDEX,
+         "add tunnel 306 10.0.0.1 <=> 10.0.0.2 index none: not answered\n"},
+        {nullptr, MAILBOX_ADD_TUNNEL, 306, 2, 77, WCCP_NO_INDEX, ""}, // told once
     };
-    lines();
+    mailbox->l2_group = 51;
+    mailbox->l2_value = 1;
     for (const auto &step : steps) {
-        EXPECT_EQ(done(step.code, step.id, 0x0A000000 + step.remote), step.status) << step.line;
-        EXPECT_EQ(mailbox->fmst_index, step.index) << step.line;
-        EXPECT_EQ(lines(), step.line + "\n");
+        SCOPED_TRACE(&step - steps);
+        if (step.options) {
+            tunneld_start(&daemon, *step.options, out);
+            EXPECT_FALSE(tunneld_step(&daemon)) << "nothing to do";
+            lines();
+        }
+        give(step.code, step.id, 0x0A000000 + step.remote);
+        mailbox->status = 77;
+        EXPECT_EQ(tunneld_step(&daemon), step.status != 77);
+        EXPECT_EQ(mailbox->command, step.status == 77 ? step.code : 0);
+        EXPECT_EQ(mailbox->status, step.status);
+        EXPECT_EQ(mailbox->fmst_index, step.index);
+        EXPECT_EQ(lines(), step.line);
     }
     ASSERT_EQ(daemon.tunnels.size(), 1u);
     EXPECT_EQ(daemon.tunnels.at(301).remote, 0x0A000009u);
-}
-
-TEST_F(Tunneld, FailsOnDemand) {
-    tunneld_start(&daemon, {.refuse = true}, out);
-    EXPECT_EQ(done(MAILBOX_ADD_TUNNEL, 300, 0x0A000002), 1u);
-    EXPECT_EQ(mailbox->fmst_index, WCCP_NO_INDEX);
-    EXPECT_EQ(done(MAILBOX_L2_RETURN, 0, 0), 1u);
-    tunneld_start(&daemon, {.first_index = WCCP_NO_INDEX}, out);
-    EXPECT_EQ(done(MAILBOX_ADD_TUNNEL, 300, 0x0A000002), 0u);
-    EXPECT_EQ(mailbox->fmst_index, WCCP_NO_INDEX);
-    EXPECT_TRUE(daemon.tunnels.empty());
-    lines();
-    tunneld_start(&daemon, {.silent = true}, out);
-    for (int i = 0; i < 3; i++) {
-        give(MAILBOX_ADD_TUNNEL, 300, 0x0A000002);
-        tunneld_step(&daemon);
-        EXPECT_EQ(mailbox->command, MAILBOX_ADD_TUNNEL);
-    }
-    EXPECT_EQ(lines(), "add tunnel 300 10.0.0.1 <=> 10.0.0.2 index none: not answered\n") << "told once";
 }
 
 // A command that wccpd takes back while it is carried out: an answer would be taken for another command's.
