@@ -57,8 +57,9 @@ struct session_thread {
         EXPECT_EQ(lew_dispatch(client.wrapper, nullptr, nullptr), LC_OK);
         ended = 1;
     }
-    void start() {
+    void start(gcl_provider *provider) {
         thread = std::thread([this] { run(); });
+        EXPECT_TRUE(provider->open_session());
         while (!ready)
             usleep(500);
     }
@@ -106,23 +107,25 @@ struct sender {
     }
 };
 
+template <size_t Count>
+void start_all(sender (&senders)[Count], session_thread *session) {
+    static pthread_mutex_t engine = PTHREAD_MUTEX_INITIALIZER;
+    for (uint16_t i = 0; i < Count; i++) {
+        senders[i].to = session;
+        senders[i].engine = &engine;
+        senders[i].number = static_cast<uint16_t>(i + 1);
+        senders[i].start();
+    }
+}
+
 // Every frame of every sender arrives whole, once and in its order, whatever the provider's pace.
 TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
     gcl_provider provider;
     ASSERT_TRUE(provider.listen_as("mgmtd"));
     session_thread session;
-    std::thread opening([&] { EXPECT_TRUE(provider.open_session()); });
-    session.start();
-    opening.join();
-
-    pthread_mutex_t engine = PTHREAD_MUTEX_INITIALIZER;
+    session.start(&provider);
     sender senders[3];
-    for (uint16_t i = 0; i < 3; i++) {
-        senders[i].to = &session;
-        senders[i].engine = &engine;
-        senders[i].number = static_cast<uint16_t>(i + 1);
-        senders[i].start();
-    }
+    start_all(senders, &session);
     std::atomic<bool> over{false};
     // Cancelled at any moment, again and again: what it was sending goes out whole, and is counted as sent.
     std::thread canceller([&] {
@@ -192,17 +195,9 @@ TEST(GclThreads, AProviderThatClosesWhileOthersSend) {
     std::minstd_rand random(3);
     for (int i = 0; i < rounds; i++) {
         session_thread session;
-        std::thread opening([&] { EXPECT_TRUE(provider.open_session()); });
-        session.start();
-        opening.join();
-        pthread_mutex_t engine = PTHREAD_MUTEX_INITIALIZER;
+        session.start(&provider);
         sender senders[2];
-        for (uint16_t k = 0; k < 2; k++) {
-            senders[k].to = &session;
-            senders[k].engine = &engine;
-            senders[k].number = static_cast<uint16_t>(k + 1);
-            senders[k].start();
-        }
+        start_all(senders, &session);
         if (i % 2)
             (void)provider.put(frame_bytes(3, 1, wire(static_cast<size_t>(random() % 3000), 'p')));
         if (i % 3)
