@@ -538,11 +538,6 @@ static lc_status change_group(const char *name, const tstr_array *parts, const b
     return LC_OK;
 }
 
-static bool is_under(const char *name, const char *root) {
-    const size_t length = strlen(root);
-    return strncmp(name, root, length) == 0 && name[length] == '/';
-}
-
 static lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_binding *binding, void *) {
     const tstring *stored = nullptr;
     CHECK_STATUS(bn_binding_get_name(binding, &stored));
@@ -555,21 +550,21 @@ static lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_bin
         CHECK_STATUS(change_facility(binding));
         return LC_OK;
     }
-    if (!is_under(name, "/qv/wccpd") && strcmp(name, SYSTEM_MODE) != 0) {
+    if (!wccpd_is_under(name, "/qv/wccpd") && strcmp(name, SYSTEM_MODE) != 0) {
         LC_LOG(LC_LOG_DEBUG, "%s: %s not for us, discarding", __func__, name);
         return LC_OK;
     }
     bool deleted = false;
     CHECK_STATUS(is_deleted(binding, &deleted));
-    if (is_under(name, SYSTEM_CONFIG)) {
+    if (wccpd_is_under(name, SYSTEM_CONFIG)) {
         CHECK_STATUS(change_global(name, binding));
-    } else if (is_under(name, GROUP_CONFIG)) {
+    } else if (wccpd_is_under(name, GROUP_CONFIG)) {
         CHECK_STATUS(change_group(name, parts.pointer, binding, deleted));
     } else if (strcmp(name, SYSTEM_MODE) == 0) {
         owned_tstring mode;
         CHECK_STATUS(read_text(binding, &mode));
         (void)wccp_system_mode_change_event(ts_str(mode.pointer));
-    } else if (!is_under(name, POLICY_CONFIG)) {
+    } else if (!wccpd_is_under(name, POLICY_CONFIG)) {
         QV_LOG(LC_LOG_INFO, "WCCP update: Unsupported binding %s", name);
     }
     return LC_OK;

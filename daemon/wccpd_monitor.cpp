@@ -15,6 +15,7 @@
 #include <cstring>
 
 #include "daemon/wccpd_main.h"
+#include "daemon/wccpd_mgmt.h"
 #include "engine/wccp_config.h"
 #include "engine/wccp_debug_utils.h"
 #include "engine/wccp_utils.h"
@@ -126,11 +127,6 @@ static bool matches(const mon_subject *subject, const char *pattern) {
     return bn_binding_name_parts_pattern_match(subject->parts, 1, pattern) != 0;
 }
 
-static bool is_under(const char *name, const char *prefix) {
-    const size_t length = strlen(prefix);
-    return strncmp(name, prefix, length) == 0 && name[length] == '/';
-}
-
 static long number_part(const mon_subject *subject, uint32_t index) {
     const char *text = tstr_array_get_str_quick(subject->parts, index);
     return text ? strtol(text, nullptr, 10) : 0;
@@ -153,7 +149,7 @@ static lc_status wccpd_mon_handle_get_wildcard(const mon_subject *subject, const
 static lc_status ask_engine(mon_subject *subject, bool *answered) {
     char routers[64], appliances[64], router_appliances[96];
     *answered = true;
-    if (!is_under(subject->name, STATE_ROOT))
+    if (!wccpd_is_under(subject->name, STATE_ROOT))
         return LC_OK;
     subject->group = static_cast<uint8_t>(number_part(subject, GROUP_PART));
     const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
@@ -225,7 +221,7 @@ static lc_status append_dump(const mon_subject *subject, const mon_node *node, b
 lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_parts, void *,
                                bn_binding_array *out) {
     LC_LOG(LC_LOG_INFO, "MonGet %s", node_name);
-    if (!is_under(node_name, "/qv/wccpd")) {
+    if (!wccpd_is_under(node_name, "/qv/wccpd")) {
         LC_LOG(LC_LOG_INFO, "MonGet not for wccpd, bailing - %s", node_name);
         return LC_OK;
     }
