@@ -13,6 +13,11 @@
 // may be nothing of its own, and then it reads nothing and comes again. It waits with no lock, for a second
 // at most, by poll, which takes descriptors of any size.
 //
+// All groups of an interface say Here-I-Am in one tick, with the engine lock held, and their routers answer
+// at once: with 256 groups of 32 routers some 8000 datagrams wait for that tick to end. The kernel's usual
+// buffer holds a few hundred; the rest would be lost at every tick, and routers time out. What a larger buffer
+// may hold is the kernel's memory and is taken only while it is full.
+//
 // A datagram that is longer than the buffer is cut to it, and the tail is gone: what is handed on has the
 // length of the buffer, and the check of the message's own length decides.
 //
@@ -41,6 +46,7 @@
 static pthread_mutex_t descriptor_lock = PTHREAD_MUTEX_INITIALIZER;
 
 static constexpr int WAIT_MS = 1000;
+static constexpr int RECEIVE_BUFFER = 16 << 20; // bytes, the kernel's own records of the datagrams included
 
 static sockaddr_in socket_address(be32 address) {
     sockaddr_in out = {};
@@ -85,6 +91,12 @@ struct socket_option {
 
 } // namespace
 
+// As large as the kernel gives it.
+static void widen_receive_buffer(int fd) {
+    if (setsockopt(fd, SOL_SOCKET, SO_RCVBUFFORCE, &RECEIVE_BUFFER, sizeof RECEIVE_BUFFER) != 0)
+        (void)setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &RECEIVE_BUFFER, sizeof RECEIVE_BUFFER);
+}
+
 // A datagram socket with these options, or -1; each failure has its line.
 template <size_t Count>
 static int open_socket(const wccp_interface *interface, const char *open_failure,
@@ -101,6 +113,7 @@ static int open_socket(const wccp_interface *interface, const char *open_failure
         close(fd);
         return -1;
     }
+    widen_receive_buffer(fd);
     return fd;
 }
 

@@ -62,6 +62,10 @@ static int open_socket(address where) {
         fprintf(stderr, "wccp_router: %s: %s\n", text_of(where).c_str(), strerror(errno));
         exit(1);
     }
+    // All groups of an appliance say Here-I-Am at once.
+    const int buffer = 4 << 20;
+    if (setsockopt(fd, SOL_SOCKET, SO_RCVBUFFORCE, &buffer, sizeof buffer) != 0)
+        (void)setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &buffer, sizeof buffer);
     return fd;
 }
 
