@@ -61,4 +61,9 @@ TEST_F(DaemonMain, SignalsThatLeaveItRunning) {
     EXPECT_EQ(said("Got unexpected signal SIGCHLD"), 1);
 }
 
+TEST_F(DaemonMain, WithoutALoopNothingStarts) {
+    EXPECT_EQ(wccpd_serv_init(), LC_ASSERTION);
+    EXPECT_EQ(wccpd_main_loop(), LC_NULL);
+}
+
 } // namespace
