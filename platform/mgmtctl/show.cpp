@@ -89,20 +89,24 @@ static std::string clock_text() {
     return text;
 }
 
+// Of a line that can go: a group, whatever it says, or an alarm.
 static std::string key_of(const std::string &line) {
-    return line.starts_with("group ") ? line.substr(0, line.find("  ")) : line;
+    if (line.starts_with("group "))
+        return line.substr(0, line.find("  "));
+    return line.starts_with("alarm ") ? line : "";
 }
 
-static void tell_changes(viewer *self, const std::vector<std::string> &now) {
+static void tell_changes(viewer *self, const picture &shown) {
+    const std::vector<std::string> now = draw_lines(shown);
     const auto missing = [](const std::vector<std::string> &from, const std::string &line) {
         return std::find(from.begin(), from.end(), line) == from.end();
     };
-    std::vector<std::string> keys;
+    std::vector<std::string> keys = {""};
     for (const std::string &line : now)
         keys.push_back(key_of(line));
     std::string text;
     for (const std::string &line : self->before)
-        if (missing(keys, key_of(line)))
+        if (shown.unreachable.empty() && missing(keys, key_of(line)))
             text += clock_text() + "  gone: " + key_of(line) + "\n";
     for (const std::string &line : now)
         if (missing(self->before, line))
@@ -117,7 +121,7 @@ static void show_one(viewer *self, const picture &shown) {
         return;
     }
     if (self->options.watch && !self->terminal) {
-        tell_changes(self, draw_lines(shown));
+        tell_changes(self, shown);
         return;
     }
     screen_form form = form_of(*self);
@@ -158,24 +162,16 @@ static void take_signal(int number) {
         ctl_stop_signal = number;
 }
 
+// Those that would leave the terminal as it is; main has taken the others.
 static void take_signals() {
     struct sigaction action = {};
-    action.sa_handler = take_signal; // without SA_RESTART: each ends a wait
-    sigset_t set;
-    sigemptyset(&set);
-    for (const int number : {SIGINT, SIGTERM, SIGHUP, SIGQUIT, SIGTSTP, SIGWINCH}) {
-        sigaddset(&set, number);
+    action.sa_handler = take_signal; // without SA_RESTART: it ends a wait
+    for (const int number : {SIGQUIT, SIGTSTP, SIGWINCH})
         sigaction(number, &action, nullptr);
-    }
-    signal(SIGPIPE, SIG_IGN);
-    sigprocmask(SIG_BLOCK, &set, nullptr);
 }
 
 static void wait_without_session() {
-    sigset_t open;
-    sigemptyset(&open);
-    const timespec limit = {PERIOD_MS / 1000, 0};
-    (void)ppoll(nullptr, 0, &limit, &open);
+    (void)poll(nullptr, 0, PERIOD_MS);
 }
 
 static void pause_if_wanted(viewer *self) {

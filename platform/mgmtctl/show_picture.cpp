@@ -276,6 +276,19 @@ static void finish_shares(picture_group *group) {
             one.asked_percent = static_cast<int>((one.weight * 100 + sum / 2) / sum);
 }
 
+// By address: an appliance keeps its letter and its place while others come and go.
+static void sort_appliances(picture_group *group) {
+    std::vector<picture_appliance> sorted = group->appliances;
+    std::sort(sorted.begin(), sorted.end(), [](const auto &a, const auto &b) {
+        return address_order(a.address) < address_order(b.address);
+    });
+    group->appliances.swap(sorted);
+    for (picture_table &table : group->tables)
+        for (int &owner : table.owners)
+            if (owner >= 0)
+                owner = appliance_place(group, sorted[static_cast<size_t>(owner)].address);
+}
+
 // Alone, or briefly: the nodes that cost little.
 static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
     std::vector<std::string> configured;
@@ -318,6 +331,7 @@ static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
     take_group_text(texts[0], group);
     take_assignment_text(texts[1], group);
     finish_shares(group);
+    sort_appliances(group);
     return true;
 }
 

@@ -290,7 +290,7 @@ static void draw_bar(pen *line, const picture_appliance &one, int place) {
         else if (middle <= asked)
             add_glyph(line, "░", '.');
         else
-            add_cells(line, " ");
+            break;
     }
     set_style(line, "0");
 }
@@ -321,18 +321,18 @@ static void draw_strip(screen *on, const picture_group &group, const picture_tab
     const auto owner_at = [&](int half) {
         return table.owners[static_cast<size_t>(half) * table.owners.size() / static_cast<size_t>(2 * cells)];
     };
+    std::string before;
     for (int i = 0; i < cells; i++) {
         const int left = owner_at(2 * i), right = owner_at(2 * i + 1);
-        if (!on->form.colour) {
-            add_cells(&line, std::string(1, letter_of(left)));
-        } else if (on->form.utf8) {
-            set_style(&line, "38;5;" + std::to_string(colour_of(left)) + ";48;5;" +
-                                 std::to_string(colour_of(right)));
+        const std::string codes = (on->form.utf8 ? "38;5;" + std::to_string(colour_of(left)) : "30") +
+                                  ";48;5;" + std::to_string(colour_of(on->form.utf8 ? right : left));
+        if (codes != before)
+            set_style(&line, codes);
+        before = codes;
+        if (on->form.colour && on->form.utf8)
             add_glyph(&line, "▌", ' ');
-        } else {
-            set_style(&line, "30;48;5;" + std::to_string(colour_of(left)));
+        else
             add_cells(&line, std::string(1, letter_of(left)));
-        }
     }
     set_style(&line, "0");
     on->end(&line);

@@ -1,0 +1,130 @@
+#!/bin/bash
+# Groups in an operator's words, over the whole appliance: added, shared out, changed in place and as a whole, put back
+# when the change is refused, deleted; policy groups; and the picture of it all, once and live, with mgmtd, wccpd and a
+# router that go and come.
+#   scenario_mgmtctl_groups.sh DIRECTORY_OF_THE_PROGRAMS
+set -u
+top=$(cd "$(dirname "$0")/.." && pwd)
+export WCCP_BIN=${1:-$top/build/release/bin}
+export LAB_SPEED=${LAB_SPEED-8}
+# shellcheck source=../lab/topology.sh
+source "$top/lab/topology.sh"
+lab_enter "$0" "$@"
+
+fail() { echo "$*" >&2; lab_show a1; exit 1; }
+# The command ends with that status, and its output makes the jq expression true.
+expect() { # STATUS EXPRESSION WORDS...
+    local status=$1 expression=$2 said got; shift 2
+    said=$(lab_manage a1 "$@"); got=$?
+    [ $got = "$status" ] || fail "$* ended with $got, not $status: $said"
+    jq -e "$expression" <<<"$said" >/dev/null || fail "$* says otherwise than $expression: $said"
+}
+shown() { lab_wait 30 "$1" lab_manage a1 show || fail "the picture does not come to show $1"; }
+
+lab_router r1 10.0.0.1
+lab_router r2 10.0.0.2
+lab_appliance a1 10.0.0.101
+lab_appliance a2 10.0.0.102
+config=/proc/${LAB_INIT[a1]}/root$LAB_CONFIG
+LAB_FOUND[a1]=$(lab_remains a1)
+
+# Without mgmtd, and without wccpd.
+expect 3 '.mgmtd == "unreachable" and (.reason | length > 0)' show
+expect 3 '.exit == 3' group add 51 router 10.0.0.1
+lab_write_config a1
+lab_mgmtd_start a1
+expect 0 '.wccpd == "absent" and .groups == []' show
+expect 0 '.done == "added" and .wccpd == "absent"' group add 50 interface eth0 router 10.0.0.1
+expect 0 '.groups[0] | .configured and (.running | not) and .routers[0].connection == "none"' show
+expect 0 '.done == "deleted"' group delete 50
+expect 4 '.code == 14004' group delete 50
+lab_start a1 tunneld tunneld
+lab_wccpd_start a1
+expect 0 '.wccpd == "running" and .status == "Ready" and .groups_total == 0' show
+
+# Added: one commit, and the group takes part.
+expect 2 '.error | test("did you mean .weight")' group add 51 wieght 100
+expect 1 '.code == 14008 and .commits == 0' group add 51 interface eth0 router 10.0.0.999
+expect 0 '.done == "added" and .commits == 1 and .running and .state == "INIT"' \
+    group add 51 interface eth0 router 10.0.0.1 weight 30 assign hash priority 10 password secret
+for router in r1 r2; do lab_ctl $router password secret >/dev/null; done
+expect 1 '.error | test("there is a group 51")' group add 51
+lab_wait_role 30 a1 51 ACTIVE || fail "the group does not become active"
+shown '.groups[0] | .designated and .state == "ACTIVE" and .appliances[0].share_percent == 100'
+expect 0 '.groups[0].routers[0] | .connection == "two-way" and .assign == "hash" and
+    (.forward == "gre" or .forward == "l2") and .return and .shares["10.0.0.101"] == 100' show
+expect 0 '.groups[0] | .password and .link == "up" and .priority == 10 and .tables[0].kind == "hash" and
+    .tables[0].buckets == [{"first": 0, "last": 255, "appliance": "10.0.0.101"}]' show
+expect 0 '.[0] | .weight == "30" and .password == "********" and .routers == ["10.0.0.1"]' group list
+
+# Changed in place: the router hears of the weight, and the group runs on.
+lab_mark a1
+expect 0 '.done == "changed" and .commits == 1 and .state == "ACTIVE" and .designated' group set 51 weight 7
+lab_wait 15 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight does not arrive"
+expect 0 '.done == "unchanged" and .commits == 0' group set 51 weight 7 router 10.0.0.1
+expect 0 '.done == "changed"' group set 51 weight default hash_dst_ip true
+! lab_log a1 | grep -q 'Deleted Group' || fail "a change in place deletes the group"
+
+# Another router takes the group as a whole; a change that is refused does not cost it.
+expect 1 '.done == "nothing" and .code == 14008' group set 51 router 10.0.0.1 router 10.0.0.999
+! lab_log a1 | grep -q 'Deleted Group' || fail "a mistyped router deletes the group"
+expect 1 '.done == "restored" and .running and (.error | test("four masks"))' group set 51 router 10.0.0.2 mask_src_ip 0xffff
+[ "$(lab_log a1 | grep -c 'Created WCCP group 51')" = 1 ] || fail "the group is not put back"
+expect 0 '.done == "recreated" and .commits == 2 and .running and (.note | test("router"))' \
+    group set 51 router 10.0.0.1 router 10.0.0.2
+grep -A 20 'config/51' "$config" | sort >"$LAB/set"
+printf '%s\n' 'assign_method = hash' 'hash_dst_ip = true' 'interface = eth0' 'password = secret' 'priority = 10' \
+    'router/1/ipaddr = 10.0.0.1' 'router/2/ipaddr = 10.0.0.2' '[/qv/wccpd/wccp/srv_grp/config/51]' | sort |
+    diff - "$LAB/set" || fail "the group is not what it was, and defaults stand in the file"
+shown '.groups[0] | .state == "ACTIVE" and .designated and (.routers | length == 2 and
+    all(.connection == "two-way" and .shares["10.0.0.101"] == 100))'
+
+# A second appliance: the shares follow the weights, and every renderer tells of both.
+lab_appliance_start a2 "$(lab_group 51 10.0.0.1 10.0.0.2 weight=300 assign_method=hash priority=10 password=secret hash_dst_ip=true)"
+shown '.groups[0].appliances | length == 2 and (map({(.address): .share_percent}) | add |
+    .["10.0.0.101"] == 25 and .["10.0.0.102"] == 75) and all(.asked_percent == .share_percent)'
+screen=$(LC_ALL=C lab_in a1 "$WCCP_BIN/mgmtctl" show)
+for text in '51  ACTIVE, designated' '  router 10.0.0.2 .* two-way' '  A 10.0.0.101 .* this weight 100 .* 25% has 25%' \
+    '  B 10.0.0.102 .* has 75%' '  hash A*B*$'; do
+    grep -Eq -- "$text" <<<"$screen" || fail "not in the picture: $text
+$screen"
+done
+[ "$(wc -l <<<"$screen")" -le 23 ] && [ "$(awk '{ print length }' <<<"$screen" | sort -n | tail -n 1)" -le 79 ] || fail "the picture is too large: $screen"
+
+# Live, in a file and on a terminal, while wccpd hears no more of a router and mgmtd goes and comes.
+lab_start a1 lines mgmtctl show --watch
+lab_start a1 terminal /usr/bin/env TERM=xterm LANG=C.UTF-8 script -qfec "stty rows 24 columns 80; exec $WCCP_BIN/mgmtctl show --watch" /dev/null
+lab_wait_line 5 '^[0-9:]{8}  group 51  ACTIVE, designated  routers 2/2  share 25% of 25%' "$LAB/a1-lines.out" ||
+    fail "no line for the group"
+lab_stop r2 router KILL 2>/dev/null
+lab_wait_line 30 '^[0-9:]{8}  alarm  group 51: a router is not connected' "$LAB/a1-lines.out" ||
+    fail "the alarm is not told"
+expect 0 '.alarms_total == 1 and .alarms[0].group == 51 and .alarms[0].name == "adjacency" and
+    ([.groups[0].routers[] | select(.address == "10.0.0.2")][0].connection != "two-way")' show
+lab_stop a1 mgmtd KILL 2>/dev/null
+lab_wait_line 5 'mgmtd: ' "$LAB/a1-lines.out" || fail "the loss of mgmtd is not told"
+lab_wait_exit 15 a1 wccpd || fail "without mgmtd wccpd ended with $?"
+lab_mgmtd_start a1
+lab_wccpd_start a1
+lab_wait_line 30 'wccpd Ready.* 1 group: 1 active' "$LAB/a1-terminal.out" || fail "the live picture does not come back"
+lab_stop a1 lines INT || fail "the lines ended with $?"
+read -r script _ <<<"$(lab_pid a1 terminal)"
+read -r live _ <"/proc/$script/task/$script/children"
+kill -INT "$live"
+lab_wait_exit 5 a1 terminal || fail "the live picture ended with $?"
+grep -aq $'^\033\\[?1049h' "$LAB/a1-terminal.out" && tail -c 40 "$LAB/a1-terminal.out" | grep -aqF $'\033[?25h\033[?1049l' ||
+    fail "the terminal is not given back"
+! grep -aq $'\033' "$LAB/a1-lines.out" || fail "lines have controls in them"
+
+# Policy groups, and the end.
+expect 0 '.done == "added"' policy add 5 name web
+expect 0 '.done == "changed" and .state != null' group set 51 policy 5
+expect 0 '.groups[0].policy == 5' show
+expect 0 '.done == "deleted" and (.note | test(" 51"))' policy delete 5
+expect 4 '.code == 14004' policy delete 5
+expect 0 '.done == "recreated" and .running' group set 51 policy none
+expect 0 '.done == "deleted" and (.running | not)' group delete 51
+expect 0 '.groups_total == 0 and .alarms_total == 0' show
+lab_end a1 a2 || exit 1
+lab_clean_log a1 'Lost connection to mgmtd' || exit 1
+exit 0
