@@ -25,7 +25,7 @@ TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
         {{"/a", "int64", "-9223372036854775808"}, "-9223372036854775808", "/a = -9223372036854775808\n"},
         {{"/a", "float64", "nan"}, "\"nan\"", "/a = nan\n"},
         {{"/a", "bool", "true"}, "true", "/a = true\n"},
-        {{"/a", "duration_ms", "3723.004"}, "3723004", "/a = 3723.004\n"},
+        {{"/a", "duration_ms", "3723004"}, "3723004", "/a = 3723004\n"},
         {{"/a", "ipv4addr", "10.0.0.1"}, "\"10.0.0.1\"", "/a = 10.0.0.1\n"},
         {{"/a", "string", "7"}, "\"7\"", "/a = 7\n"},
         {{"/a", "string", ""}, "\"\"", "/a =\n"},
@@ -34,6 +34,10 @@ TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
         {{"/a", "string", "\xff"}, "\"\\ufffd\"", "/a = \xff\n"},
         {{"/a/password", "string", "geheim"}, "\"********\"", "/a/password = ********\n"},
         {{"/a/password", "string", ""}, "\"\"", "/a/password =\n"},
+        {{"/a/debug", "string", "WCCP password  : ab 0x61\nx: y\n WCCP password : \nWCCP password"},
+         "\"WCCP password  : ********\\nx: y\\n WCCP password : ********\\nWCCP password\"",
+         "/a/debug =\n    WCCP password  : ********\n    x: y\n     WCCP password : ********\n    WCCP "
+         "password\n"},
     };
     for (const auto &one : cases) {
         EXPECT_EQ(json_line(json_node(one.binding, false)["value"]), std::string(one.json) + "\n");

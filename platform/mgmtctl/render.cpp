@@ -1,8 +1,7 @@
 // The forms of what mgmtctl tells.
 //
 // For a person a node is a line "NAME = VALUE"; whoever asks for one node gets its value alone. For a script
-// everything is JSON in which numbers are numbers; durations are numbers as well, in the unit that their type
-// names, since the texts of durations are for reading. The keys are told in docs/mgmtctl.md and don't change.
+// everything is JSON in which numbers are numbers. The keys are told in docs/mgmtctl.md and don't change.
 //
 // Nothing here ends the program: a pipe that nobody reads any more shows when main looks at standard output.
 #include "platform/mgmtctl/render.h"
@@ -13,7 +12,6 @@
 #include "platform/binding_text.h"
 #include "platform/schema.h"
 #include "runtime/common.h"
-#include "runtime/ttime.h"
 
 void put(const std::string &text) {
     (void)fwrite(text.data(), 1, text.size(), stdout);
@@ -25,18 +23,25 @@ std::string json_line(const ctl_json &value) {
 
 // --- Nodes
 
-static bool is_secret(const ctl_binding &binding) {
-    return binding.name.ends_with("/password") && !binding.value.empty();
-}
+static const char *const STARS = "********";
 
 std::string shown_value(const ctl_binding &binding, bool secrets) {
-    return is_secret(binding) && !secrets ? "********" : binding.value;
-}
-
-template <typename Duration>
-static ctl_json duration(const std::string &text, lc_status (*convert)(const char *, Duration *)) {
-    Duration value = 0;
-    return convert(text.c_str(), &value) == LC_OK ? ctl_json(value) : ctl_json(text);
+    if (secrets || binding.value.empty())
+        return binding.value;
+    if (binding.name.ends_with("/password"))
+        return STARS;
+    // The dumps of groups have it in a line of theirs.
+    std::string text = binding.value;
+    if (!binding.name.ends_with("/debug") && !binding.name.ends_with("/debug_all"))
+        return text;
+    static const std::string label = "WCCP password";
+    for (size_t at = text.find(label); at != std::string::npos; at = text.find(label, at + 1)) {
+        const size_t end = std::min(text.find('\n', at), text.size());
+        const size_t colon = text.find(": ", at);
+        if (colon < end)
+            text.replace(colon + 2, end - colon - 2, STARS);
+    }
+    return text;
 }
 
 ctl_json json_value(const ctl_binding &binding) {
@@ -48,12 +53,6 @@ ctl_json json_value(const ctl_binding &binding) {
         return nullptr;
     case bn_type_bool:
         return text == "true" ? ctl_json(true) : text == "false" ? ctl_json(false) : ctl_json(text);
-    case bn_type_duration_sec:
-        return duration(text, lt_str_to_dur_sec);
-    case bn_type_duration_ms:
-        return duration(text, lt_str_to_dur_ms);
-    case bn_type_duration_us:
-        return duration(text, lt_str_to_dur_us);
     default:
         break;
     }

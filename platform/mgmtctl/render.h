@@ -14,10 +14,10 @@ using ctl_json = nlohmann::ordered_json;
 void put(const std::string &text);
 std::string json_line(const ctl_json &value); // with its newline
 
-// Numbers, booleans and durations (in their unit) become numbers and booleans, a node without value null.
+// Numbers, durations and booleans become numbers and booleans, a node without value null.
 ctl_json json_value(const ctl_binding &binding);
 ctl_json json_node(const ctl_binding &binding, bool secrets); // name, type, value
-// The value; a password becomes eight stars unless asked for.
+// The value; a password, also one in a dump, becomes eight stars unless asked for.
 std::string shown_value(const ctl_binding &binding, bool secrets);
 // "NAME = VALUE"; further lines of the value are indented.
 std::string text_node(const ctl_binding &binding, bool secrets);

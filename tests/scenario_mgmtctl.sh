@@ -1,0 +1,199 @@
+#!/bin/bash
+# mgmtctl beside the real programs: what it answers with mgmtd absent, stopped and killed, what a person and a script
+# get from each word, the monitoring tree of a group that runs, node by node, and a watch of all that happens meanwhile.
+#   scenario_mgmtctl.sh DIRECTORY_OF_THE_PROGRAMS
+set -u
+top=$(cd "$(dirname "$0")/.." && pwd)
+export WCCP_BIN=${1:-$top/build/release/bin} LAB_SPEED=${LAB_SPEED:-5}
+# shellcheck source=../lab/topology.sh
+source "$top/lab/topology.sh"
+lab_enter "$0" "$@"
+
+G=/qv/wccpd/wccp/srv_grp/config/51
+S=/qv/wccpd/wccp/srv_grp/state/51
+fail() { echo "$*" >&2; cat "$LAB"/said "$LAB"/complained >&2; lab_show a1 2>/dev/null; exit 1; }
+ctl() { lab_in a1 "$WCCP_BIN/mgmtctl" "$@"; }
+# The exit code, then what standard output has to match whole (a bash pattern, or after "jq:" an expression).
+expect() { # STATUS OUTPUT WORDS...
+    local status=$1 wanted=$2 got; shift 2
+    ctl "$@" >"$LAB/said" 2>"$LAB/complained"; got=$?
+    [ $got = "$status" ] || fail "mgmtctl $*: status $got, not $status"
+    case $wanted in
+    jq:*) jq -e "${wanted#jq:}" <"$LAB/said" >/dev/null || fail "mgmtctl $*: not so: ${wanted#jq:}" ;;
+    # shellcheck disable=SC2053
+    *) [[ $(<"$LAB/said") == $wanted ]] || fail "mgmtctl $*: output other than: $wanted" ;;
+    esac
+}
+complains() { # PATTERN : and did, the last time
+    # shellcheck disable=SC2053
+    [[ $(<"$LAB/complained") == $1 ]] || fail "the complaint is not: $1"
+}
+began() { date +%s%N; }
+took_ms() { echo $((($(date +%s%N) - $1) / 1000000)); }
+
+lab_router r1 10.0.0.1 -- --password geheim
+lab_appliance a1 10.0.0.101
+
+# --- Without mgmtd
+
+expect 3 '' get $G/weight
+complains 'mgmtctl: mgmtd is not running (nothing listens at /tmp/gcl-socks/uds-provider-mgmtd)'
+expect 3 'jq:.exit == 3 and (.error | startswith("mgmtd is not running"))' --json walk /
+expect 2 '' get
+complains 'mgmtctl: NAME is required*'
+expect 2 '' gte
+complains 'mgmtctl: unknown word "gte"; known are get walk*'
+expect 2 '' set /a=1 /b
+expect 0 '/qv/wccpd' complete /qv/wcc
+lab_in a1 test ! -e /tmp/gcl-socks || fail "a question leaves something behind"
+
+# --- A group that runs, and a watch from its start on
+
+lab_appliance_start a1 "$(lab_group 51 10.0.0.1 password=geheim)" || fail "the appliance does not start"
+(ctl --json watch; echo "{\"ended\": $?}") >"$LAB/watched" &
+watch=$!
+(ctl watch "$G/wei*" "$G/weight" --count 2; echo "status $?") >"$LAB/watched-one" 2>&1 &
+watch_one=$!
+lab_wait_role 60 a1 51 ACTIVE || fail "the group does not become active"
+lab_wait 20 '.["51"].router["1"].appliance["10.0.0.101"].load_dist == 100' lab_state a1 || fail "no assignment"
+
+expect 0 100 get $G/weight
+expect 0 "$G/weight = 100"$'\n'"$G/password = [*][*][*][*][*][*][*][*]" get $G/weight $G/password
+expect 0 'jq:. == [{name: "'$G'/weight", type: "uint32", value: 100}, {name: "'$G'/password", type: "string", value: "geheim"}]' \
+    get --json --secrets $G/weight $G/password
+expect 4 'jq:.[0].code == 14004 and .[0].hint == "did you mean '$G'/weight?" and .[1].value == 100' --json get $G/wieght $G/weight
+expect 4 '' get $G/policy_grp
+complains "mgmtctl: $G/policy_grp: is not set"$'\n'"*has no default"
+expect 4 '' walk /qv/nobody
+complains '*there is nothing below*'
+
+# --- The monitoring tree, whole: names and types, and the values that are known
+
+expect 0 'jq:
+    def dotted: test("^[0-9]+[.][0-9]+[.][0-9]+[.][0-9]+$");
+    (map({key: .name, value: .}) | from_entries) as $n | (map([.name, .type]) | sort) == ([
+        ["", "string"], ["/oper", "string"], ["/uptime", "duration_ms"], ["/app_id", "string"],
+        ["/num_routers", "uint32"], ["/num_appliances", "uint32"], ["/debug", "string"], ["/assignment", "string"],
+        ["/router/1", "string"], ["/router/1/state", "string"], ["/router/1/fwd_method", "string"],
+        ["/router/1/ret_method", "string"], ["/router/1/assign_method", "string"], ["/router/1/id", "ipv4addr"],
+        ["/router/1/ipaddr", "ipv4addr"], ["/router/1/conn_time", "duration_ms"],
+        ["/router/1/appliance/10.0.0.101", "string"], ["/router/1/appliance/10.0.0.101/load_dist", "uint32"],
+        ["/appliance/1/ipaddr", "ipv4addr"], ["/appliance/1/weight", "uint32"]
+    ] | map(.[0] |= "'$S'" + .) | sort)
+    and ([$n["'$S'", "'$S'/oper", "'$S'/app_id", "'$S'/num_routers", "'$S'/num_appliances", "'$S'/router/1", "'$S'/router/1/state",
+        "'$S'/router/1/ipaddr", "'$S'/router/1/appliance/10.0.0.101", "'$S'/router/1/appliance/10.0.0.101/load_dist",
+        "'$S'/appliance/1/ipaddr", "'$S'/appliance/1/weight"] | .value] ==
+        ["51", "ACTIVE, DESIGNATED", "10.0.0.101", 1, 1, "1", "TWO-WAY connected", "10.0.0.1", "10.0.0.101", 100, "10.0.0.101", 100])
+    and all($n["'$S'/router/1/fwd_method", "'$S'/router/1/ret_method"].value; . == "GRE" or . == "L2")
+    and ($n["'$S'/router/1/assign_method"].value | . == "HASH" or . == "MASK")
+    and ($n["'$S'/router/1/id"].value | dotted)
+    and all($n["'$S'/uptime", "'$S'/router/1/conn_time"].value; type == "number" and . > 0 and . % 1000 == 0)
+    and all($n["'$S'/debug", "'$S'/assignment"].value; contains("\n")) and (tostring | contains("geheim") | not)' --json walk $S
+expect 0 '*WCCP password * : geheim *' get --secrets $S/debug
+expect 0 'jq:all(.type == "string") and (map({key: (.name | ltrimstr("/qv/wccpd/system/state/")), value: .value}) | from_entries) as $n |
+    ($n | keys) == ["debug_all", "debug_global", "is_alive", "proto_ver"] and $n.proto_ver == "2.0" and $n.is_alive == "Ready"' \
+    --json walk /qv/wccpd/system/state
+expect 0 'jq:map(.name) == ["'$S'"]' --json walk --children "${S%/*}"
+expect 0 "*$S/debug ="$'\n    '"*$S/appliance/1/weight = 100*" walk /
+expect 4 '' get $S/router/1/speed
+# A number that isn't there reads as zeros, by design of the tree.
+expect 0 0.0.0.0 get $S/appliance/2/ipaddr
+
+# --- Changes
+
+expect 0 '' set $G/weight 7
+lab_wait 20 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight does not arrive"
+expect 0 '' set $G/weight=9 $G/mask_dst_ip=0x7f
+expect 0 'jq:.[0].value == 127' --json get $G/mask_dst_ip
+expect 1 '' set $G/weight=70000 $G/priority=1
+complains "mgmtctl: $G/weight: \"70000\" is not between 0 and 65535"
+expect 0 'jq:map(.value) == [9, 200]' --json get $G/weight $G/priority
+expect 1 'jq:.name == "'$G'/password" and .code == 14008 and (.error | contains("123456789") | not)' --json set $G/password 123456789
+expect 4 '' set --existing "${G%51}52/weight" 1
+expect 4 '' set $S/oper=BACKUP
+complains '*it is a state: it can only be read'
+expect 0 "created ${G%51}52" set "${G%51}52/weight=1"
+expect 0 'jq:.changed == ["'"${G%51}52"'"] and .exit == 0' --json delete "${G%51}52"
+expect 4 '' delete "${G%51}52"
+expect 0 '' set $G/priority 100
+complains '*note: group 51: a running group follows a change of priority only*'
+expect 0 '' delete $G/router/1
+complains '*note: group 51: without router/1 wccpd lets a running group go*'
+expect 0 '' delete $G/mask_dst_ip
+expect 0 3840 get $G/mask_dst_ip
+
+# --- Alarms: the router goes away, and the group with it
+
+expect 0 '' delete $G
+expect 0 'created*' set $G/interface=eth0 $G/router/1/ipaddr=10.0.0.1 $G/password=geheim
+lab_wait 60 '.["51"].router["1"].state == "TWO-WAY connected"' lab_state a1 || fail "the group is not created again"
+expect 0 'no alarm stands' alarms --check
+lab_ctl r1 stop >/dev/null
+lab_wait_event 60 a1 '^alarm raised: .*51' || fail "no alarm of a router that is gone"
+expect 6 '*adjacency*grp:51*' alarms --check
+expect 0 'jq:.[0] | .type == 196638 and .name == "adjacency" and (.source | endswith(":grp:51")) and
+    (.reporter | startswith("wccpd-")) and (.since | length) == 19' --json alarms
+lab_ctl r1 resume >/dev/null
+lab_wait_event 60 a1 '^alarm cleared: .*51' || fail "the alarm stays"
+expect 0 '[[]]' --json alarms --check
+
+# --- What a shell makes of it
+
+(ctl walk / | true; exit "${PIPESTATUS[0]}"); [ $? = 141 ] || fail "a pipe that nobody reads"
+ctl walk / >/dev/full 2>"$LAB/complained"; [ $? = 7 ] || fail "a full device"
+complains 'mgmtctl: standard output: No space left on device'
+completed() { # WORD... : what the shell would offer
+    lab_in a1 bash -c 'PATH=$1:$PATH; source "$2"; compopt() { :; }; shift 2
+        COMP_WORDS=(mgmtctl "$@"); COMP_CWORD=$#; _mgmtctl; echo "${COMPREPLY[*]}"' - "$WCCP_BIN" "$top/packaging/mgmtctl.bash-completion" "$@"
+}
+[ "$(completed al)" = alarms ] && [ "$(completed get "${G%1}")" = $G ] && [ "$(completed group set '')" = 51 ] &&
+    [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&
+    [ "$(completed walk --le)" = --leaves ] || fail "the shell completes otherwise"
+if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
+    lab_in a1 setpriv --reuid 65534 --clear-groups "$WCCP_BIN/mgmtctl" get $G/weight 2>"$LAB/complained"
+    [ $? = 3 ] || fail "another user gets an answer"
+    complains '*only root and the user that mgmtd runs as may use it'
+fi
+
+# --- wccpd stopped, mgmtd stopped, mgmtd killed
+
+kill -STOP "$(lab_pid a1 wccpd)"
+expect 3 '' get $S/oper
+complains "mgmtctl: $S/oper: wccpd-* did not answer in time"
+expect 0 "*$G/weight = *" walk /qv
+kill -CONT "$(lab_pid a1 wccpd)"
+expect 0 '?*' get $S/oper
+mgmtd=$(lab_pid a1 mgmtd)
+kill -STOP "$mgmtd"
+at=$(began)
+expect 3 '' --timeout 0.5 get $G/weight
+complains 'mgmtctl: mgmtd gave no answer in 0.500 s'
+[ "$(completed get "${G%1}")" = '' ] || fail "completion says something"
+[ "$(took_ms "$at")" -lt 3000 ] || fail "a stopped mgmtd holds a person up for $(took_ms "$at") ms"
+ctl get $G/weight & asking=$!
+sleep 0.3
+# shellcheck disable=SC2046
+kill -TERM $(cat /proc/$asking/task/*/children)
+wait $asking; [ $? = 143 ] || fail "a question that is ended by a signal"
+kill -CONT "$mgmtd"
+expect 0 100 get $G/weight
+lab_in a1 bash -c 'ls /tmp/gcl-socks | grep -c mgmtctl' >"$LAB/said"
+[ "$(cat "$LAB/said")" = 1 ] || fail "questions leave sockets behind" # the watch has one
+
+wait $watch_one
+[ "$(cut -d' ' -f2- <"$LAB/watched-one")" = "modify $G/weight = 7 (was 100)
+modify $G/weight = 9 (was 7)
+0" ] || { cat "$LAB/watched-one" >&2; fail "the watch of one node"; }
+lab_stop a1 mgmtd KILL 2>/dev/null
+wait $watch
+jq -s -e 'def one(f): [.[] | select(f)] | length == 1;
+    .[-2].error == "mgmtd closed the session" and .[-1].ended == 3
+    and one(.event == "change" and any(.changes[]; .name == "'$G'/weight" and .change == "modify" and .before == 100 and .after == 7))
+    and one(.event == "change" and (.changes | length) == 1 and .changes[0] == {name: "'$G'/mask_dst_ip", change: "modify", type: "uint32", before: 127, after: 3840})
+    and any(.[]; .event == "role" and .group == 51 and .role == "ACTIVE")
+    and one(.event == "alarm_raised" and .name == "adjacency") and one(.event == "alarm_cleared" and .name == "adjacency")
+    and all(.[:-2][]; .time | test("^20..-..-..T..:..:..[+-]....$"))' <"$LAB/watched" >/dev/null ||
+    { cat "$LAB/watched" >&2; fail "the watch has seen something else"; }
+expect 3 '' get $G/weight
+complains 'mgmtctl: mgmtd is not running (nothing listens at *)'
+exit 0
