@@ -1,0 +1,165 @@
+#!/bin/bash
+# What an operator changes while groups run: each node of a group, whole groups, policy groups, the mode of the system.
+#   scenario_configuration.sh DIRECTORY_OF_THE_PROGRAMS [CASE...]
+set -u
+: "${LAB_SPEED:=8}"
+export LAB_SPEED
+# shellcheck source=../lab/cases.sh
+source "$(dirname "$0")/../lab/cases.sh"
+lab_cases "$@"
+
+words=(assign_method=hash)
+# One more word for the group, or another value for one that it has: one commit, applied to the running group.
+change() { # WORD LINE_OF_THE_LOG
+    local word kept=()
+    for word in "${words[@]}"; do [ "${word%%=*}" = "${1%%=*}" ] || kept+=("$word"); done
+    words=("${kept[@]}" "$1")
+    lab_mark a1
+    configure a1 "$(lab_group 51 10.0.0.1 10.0.0.2 "${words[@]}")" || die "$1"
+    says a1 5 "WCCP config: $2\$"
+    says a1 5 'WCCP Modify config complete'
+}
+changes() { [[ $(lab_state a1 51 | jq -r .debug) = *"$1"* ]] || die "the group's record lacks: $1"; }
+
+# None of these stops the group or takes it out of ACTIVE; each is in the next message that it belongs to.
+case_nodes() {
+    lab_router r1 10.0.0.1
+    lab_router r2 10.0.0.2
+    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1 10.0.0.2 assign_method=hash)"
+    role a1 30 51 ACTIVE
+    change weight=7 'set weight to 7'
+    change hash_dst_ip=true 'set hash dst ip to yes'
+    change hash_src_port=true 'set hash src port to yes'
+    change hash_dst_port=true 'set hash dst port to yes'
+    change hash_src_ip=false 'set hash src ip to no'
+    change mask_src_ip=0x3 'set mask src ip to 0x3'
+    change mask_dst_ip=0x1 'set mask dst ip to 0x1'
+    change mask_src_port=0x10 'set mask src port to 0x10'
+    change mask_dst_port=0x20 'set mask dst port to 0x20'
+    change force_l2_return=true 'set force l2 return to yes'
+    change encap=gre 'set encap gre to 1'
+    change assign_method=mask 'set assignment method to mask'
+    change policy_grp=9 'set policy grp to 9'
+    router_is r1 15 51 '$g.appliances[0].weight == 7'
+    changes 'WCCP config fwd, assign, return  : gre, mask,'
+    changes 'WCCP service flags               : 0xe'
+    changes 'Configured MASK            : src-ip: 0x00000003, src-port: 0x0010'
+    # What has been agreed stays until the group starts anew; then what was changed is agreed.
+    group_is a1 1 51 '.oper == "ACTIVE, DESIGNATED" and .router["1"].fwd_method == "L2" and .router["1"].assign_method == "HASH"'
+    change admin=down 'set admin down:2'
+    router_is r1 5 51 '$g.appliances == []'
+    group_is a1 5 51 '.oper == "INIT" and .num_routers == 0'
+    change admin=up 'set admin up:1'
+    role a1 30 51 ACTIVE
+    group_is a1 10 51 '.router["1"].fwd_method == "GRE" and .router["1"].assign_method == "MASK"'
+    router_is r1 10 51 '$g.service.flags == 14 and ($g.assignment.masks[0].mask | [.src_ip, .dst_ip, .src_port, .dst_port]) == [3, 1, 16, 32]'
+    grep -q 'L2 return group 51 value 1: done' "$LAB/a1-tunneld.out" || die "tunneld was not told of the L2 return"
+    finish a1
+}
+
+# A password here that the routers don't have yet: they refuse, and heed the group again once they have it.
+case_password() {
+    lab_router r1 10.0.0.1 -- --query-after 600 --drop-after 600
+    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1)"
+    role a1 30 51 ACTIVE
+    lab_mark a1
+    configure a1 "$(lab_group 51 10.0.0.1 password=squeak)"
+    says a1 5 'WCCP config: set password$'
+    lab_wait_line 10 'refused: ' "$LAB/r1.log" || die "r1 takes a signed message"
+    lab_ctl r1 password squeak >/dev/null
+    lab_wait_line 10 '"what":"i-see-you".*"service":51' <(tail -n +$(($(wc -l <"$LAB/r1.log") + 1)) -f "$LAB/r1.log" & sleep 4; kill $!) ||
+        die "r1 does not answer"
+    group_is a1 10 51 '.router["1"].state == "TWO-WAY connected"'
+    ! grep -q squeak "$LAB/a1.log" || die "the password is in the log"
+    finish a1 -- 'mismatch security opt'
+}
+
+# What a running group doesn't follow: it is said, and the group goes on; an entry taken out takes the group with it.
+case_not_followed() {
+    lab_router r1 10.0.0.1
+    lab_router r2 10.0.0.2
+    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1 10.0.0.2)"
+    role a1 30 51 ACTIVE
+    configure a1 "$(lab_group 51 10.0.0.1 10.0.0.2 priority=9 protocol=udp)"
+    says a1 5 'WCCP update: Unknown binding /qv/wccpd/wccp/srv_grp/config/51/priority'
+    group_is a1 1 51 '.oper == "ACTIVE, DESIGNATED"'
+    router_is r1 1 51 '$g.service.priority == 200 and $g.service.protocol == 6'
+    configure a1 "$(lab_group 51 10.0.0.1 priority=9 protocol=udp)"
+    router_is r1 5 51 '$g.appliances == []'
+    says a1 5 'WCCP update: Deleted Group 51'
+    # Deleted and added again, it follows.
+    configure a1
+    configure a1 "$(lab_group 51 10.0.0.1 priority=9 protocol=udp)"
+    says a1 5 'Created WCCP group 51'
+    router_is r1 30 51 '$g.service.priority == 9 and $g.service.protocol == 17 and ($g.appliances | length) == 1'
+    finish a1 -- 'WCCP update: (Unknown binding|Failed to delete Group 51)' 'Group 51 does not exists' 'Error code'
+}
+
+# Forty groups come and go with one commit each.
+case_many() {
+    local id text=''
+    lab_router r1 10.0.0.1
+    for id in $(seq 10 49); do text+="$(lab_group "$id" 10.0.0.1 weight=$id)"$'\n'; done
+    appliance a1 10.0.0.101
+    configure a1 "$text"
+    lab_wait 40 '[.groups[].assignment.kind] | length == 40 and all(. == "mask")' lab_ctl r1 show || die "not all have tables"
+    lab_wait 15 '[.[].oper] | length == 40 and all(. == "ACTIVE, DESIGNATED")' lab_state a1 || die "not all are active"
+    configure a1
+    lab_wait 10 '[.groups[].appliances[]] == []' lab_ctl r1 show || die "not all have left"
+    lab_wait 5 '. == {}' lab_state a1 || die "groups are left"
+    finish a1
+}
+
+# A policy group is as its groups are: active with all of them. The groups of one that is deleted go to number 300.
+case_policy() {
+    roles() { lab_wait_line "$1" "$2" "$LAB/a1-tunneld.out" || die "role"; }
+    local policy='[/qv/wccpd/wccp/policy_grp/config/5]'
+    lab_router r1 10.0.0.1
+    lab_router r2 10.0.0.2
+    lab_ctl r2 stop >/dev/null
+    LAB_TUNNELD=--roles
+    appliance a1 10.0.0.101 "$policy" name=blue "$(lab_group 51 10.0.0.1 policy_grp=5)" "$(lab_group 52 10.0.0.2 policy_grp=5)"
+    role a1 30 51 ACTIVE
+    roles 5 '5.*BACKUP'
+    lab_ctl r2 resume >/dev/null
+    role a1 40 52 ACTIVE
+    roles 5 '5.*ACTIVE'
+    configure a1 "$(lab_group 51 10.0.0.1 policy_grp=5)" "$(lab_group 52 10.0.0.2 policy_grp=5)"
+    says a1 5 'WCCP update: Deleted policy Group 5'
+    roles 5 '300.*ACTIVE'
+    roles 5 '5.*UNKNOWN'
+    lab_ctl r2 stop >/dev/null
+    role a1 40 52 BACKUP
+    roles 5 '300.*BACKUP'
+    finish a1
+}
+
+# A bridge redirects nothing: its groups take leave, and stand until the daemon starts in another mode.
+case_bridge() {
+    local mode='[/qv/tunneld/system/config]' sent
+    lab_router r1 10.0.0.1
+    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1)"
+    role a1 30 51 ACTIVE
+    configure a1 "$mode" mode=bridge "$(lab_group 51 10.0.0.1)"
+    router_is r1 5 51 '.counters.rx_shutdown == 1 and $g.appliances == []'
+    group_is a1 5 51 '.oper == "INIT"'
+    sent=$(lab_ctl r1 show | jq .counters.rx_here_i_am)
+    configure a1 "$mode" mode=router "$(lab_group 51 10.0.0.1)"
+    lab_sleep 25
+    router_is r1 1 51 ".counters.rx_here_i_am == $sent"
+    lab_stop a1 wccpd || die "ended with $?"
+    lab_wccpd_start a1
+    role a1 30 51 ACTIVE
+    lab_stop a1 wccpd || die "ended with $?"
+    # Started as a bridge: no timers, nothing said, queries answered, the end as ever.
+    configure a1 "$mode" mode=bridge "$(lab_group 51 10.0.0.1)"
+    sent=$(lab_ctl r1 show | jq .counters.rx_here_i_am)
+    lab_wccpd_start a1
+    says a1 5 'WCCP timer/rx threads are not launched in non Router mode'
+    lab_sleep 15
+    router_is r1 1 51 ".counters.rx_here_i_am == $sent"
+    group_is a1 5 51 '.oper == "INIT"'
+    finish a1
+}
+
+lab_case

@@ -1,0 +1,83 @@
+#!/bin/bash
+# The tunnel daemon isn't there, is slow, refuses, says nothing, dies: the group does what it can, says what it can't,
+# and wccpd ends in order in each of these.
+#   scenario_tunneld.sh DIRECTORY_OF_THE_PROGRAMS [CASE...]
+set -u
+: "${LAB_SPEED:=4}" # commands to tunneld are waited for in seconds of the wall
+export LAB_SPEED
+# shellcheck source=../lab/cases.sh
+source "$(dirname "$0")/../lab/cases.sh"
+lab_cases "$@"
+
+start() { # TUNNELD : its options, or none
+    lab_router r1 10.0.0.1 -- --forward gre --return gre
+    LAB_TUNNELD=$1
+    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1)"
+}
+no_tunnel='failed to add tunnel: id: 232 10.0.0.101 <=> 10.0.0.1'
+# Without its tunnel a router isn't taken in, is asked again at each of its messages, and is told of us all the same.
+refused() {
+    says a1 20 "$no_tunnel"
+    group_is a1 5 51 '.oper == "INIT" and .num_routers == 0'
+    router_is r1 30 51 '.counters.rx_here_i_am >= 3 and $g.assignment.kind != "hash" and $g.assignment.kind != "mask"'
+    [ "$(lab_log a1 | grep -c "$no_tunnel")" -ge 2 ] || die "not asked again"
+}
+at_last() {
+    role a1 40 51 ACTIVE
+    router_is r1 5 51 '[$g.appliances[].address] == ["10.0.0.101"]'
+    finish a1 -- 'GRE tunnel L2 return add timed out' 'Error code'
+    grep -q 'delete tunnel 232 .*: done' "$LAB/a1-tunneld.out" || die "the tunnel is left"
+}
+
+case_absent() {
+    start none
+    refused
+    lab_start a1 tunneld tunneld
+    at_last
+}
+case_absent_at_the_end() {
+    start none
+    refused
+    finish a1 -- 'GRE tunnel L2 return add timed out'
+}
+case_slow() {
+    start '--slow 400'
+    at_last
+}
+case_silent() {
+    start --silent
+    says a1 20 'GRE tunnel add timed out'
+    refused
+    lab_stop a1 tunneld KILL
+    lab_start a1 tunneld tunneld
+    at_last
+}
+case_refusing() {
+    start --refuse
+    refused
+    finish a1
+}
+# mgmtd keeps both: a crash of tunneld ends wccpd in order, and all of it comes back with tunnels of its own.
+case_crash() {
+    lab_router r1 10.0.0.1 -- --forward gre --return gre
+    lab_appliance a1 10.0.0.101
+    lab_write_config a1 "$(lab_group 51 10.0.0.1)"
+    : >"$LAB/a1-mgmtd.out"
+    lab_clock # of mgmtd this time, whose children inherit it
+    lab_start a1 mgmtd "$(command -v env)" "${LAB_CLOCK[@]:1}" "$WCCP_BIN/mgmtd" --config "$LAB_CONFIG" --supervise --wccpd "$WCCP_BIN/wccpd" --tunneld "$WCCP_BIN/tunneld"
+    role a1 60 51 ACTIVE
+    lab_mark a1
+    lab_in a1 pkill -KILL -x tunneld
+    says a1 10 'WCCP daemon exiting with code 0'
+    router_is r1 5 51 '.counters.rx_shutdown == 1 and $g.appliances == []'
+    lab_wait_event 10 a1 '^process wccpd: exited with 0, starts again' || die "not seen to end"
+    says a1 20 'WCCP daemon launched'
+    says a1 60 'created GRE tunnel id 232 10.0.0.101 <=> 10.0.0.1'
+    router_is r1 60 51 '[$g.appliances[].address] == ["10.0.0.101"] and $g.assignment.kind == "hash"'
+    role a1 20 51 ACTIVE
+    lab_stop a1 mgmtd || die "mgmtd ended with $?"
+    [ "$(lab_in a1 pgrep -cx 'wccpd|tunneld')" = 0 ] || die "programs are left"
+    lab_clean_log a1 || die "not clean"
+}
+
+lab_case
