@@ -216,6 +216,8 @@ static lc_status get_binding(wire_reader *reader, bn_binding **out) {
     owned_binding binding;
     CHECK_STATUS(bn_binding_new_parts_components_takeover(&binding.pointer, &name, &parts.pointer,
                                                           absolute ? 1 : 0, nullptr));
+    // The name has them all, and they take more memory than everything else of a binding.
+    CHECK_STATUS(bn_binding_drop_name_parts(binding.pointer));
     uint32_t count = 0;
     CHECK_STATUS(get_u32(reader, &count));
     for (uint32_t i = 0; i < count; i++)

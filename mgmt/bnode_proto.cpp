@@ -392,7 +392,7 @@ int32_t bn_request_get_msg_id(const bn_request_msg *msg) {
     return msg ? static_cast<int32_t>(msg->msg_id) : -1;
 }
 
-// Parts that the reader asked for are made now; the others go.
+// Of a request: parts that the reader asked for are made now; the others go. A response keeps what it has.
 static lc_status settle_parts(bn_binding *binding, int keep_parts) {
     if (!keep_parts)
         return bn_binding_drop_name_parts(binding);
@@ -498,7 +498,8 @@ static lc_status read_response(const bn_response_msg *msg, bool take, uint32_t *
         if (!out_bindings)
             continue;
         CHECK_STATUS(read_node(node, take, &binding.pointer));
-        CHECK_STATUS(settle_parts(binding.pointer, keep_parts));
+        if (!keep_parts)
+            CHECK_STATUS(bn_binding_drop_name_parts(binding.pointer));
         CHECK_STATUS(bn_binding_array_append_takeover(bindings.pointer, &binding.pointer));
     }
     if (out_code)

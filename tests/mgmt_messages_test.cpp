@@ -156,6 +156,7 @@ TEST(messages, response_bytes_and_reading) {
     msg->db_revision_id = 99;
     binding_owner binding;
     ASSERT_EQ(bn_binding_new_str(&binding, "/n", bn_attrib_value, bn_type_str, 0, "v"), 0);
+    ASSERT_EQ(bn_binding_name_to_parts("/n", &binding.pointer->parts, nullptr), 0);
     ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg, &binding.pointer, 1004), 0);
     expect_response(msg, 2,
                     u32(3) + str("no") + u32(1) + u32(1004) + u8(1) + u32(1) + str("n") + u32(1) +
