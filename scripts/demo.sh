@@ -26,7 +26,7 @@ if [ "${LAB_INSIDE-}" != 1 ] && [ -n "$build" ]; then
     echo "building (build/release)"
     mkdir -p "$top/build"
     log=$top/build/demo-build.log
-    (cd "$top" && cmake --preset release && cmake --build --preset release -j "$(nproc)" --target wccp_router tunneld wccp_engine_host) \
+    (cd "$top" && cmake --preset release && cmake --build --preset release -j "$(nproc)" --target wccp_router mgmtd mgmtctl tunneld wccpd) \
         >"$log" 2>&1 || { tail -n 30 "$log"; exit 1; }
 fi
 : "${WCCP_BIN:=$top/build/release/bin}"
@@ -41,16 +41,15 @@ lab_enter "$0" "${arguments[@]}"
 declare -A address=([r1]=10.0.0.1 [r2]=10.0.0.2 [a1]=10.0.0.101 [a2]=10.0.0.102) weight=([a1]=60 [a2]=100)
 declare -A letter=([10.0.0.101]=A [10.0.0.102]=B) colour=([10.0.0.101]=4 [10.0.0.102]=3 [-]=0)
 appliances=(a2 a1)
-sockets=/run/wccpd/host.sock
+declare -A groups_of # the configuration of each appliance
 
-tell() { lab_in "$1" "$WCCP_BIN/wccp_router" ctl $sockets "${@:2}" 2>/dev/null; } # APPLIANCE COMMAND...
 group_add() { # ID ASSIGNMENT
     local a
     for a in "${appliances[@]}"; do
         # A hears of B with its own second I-See-You when B speaks first; otherwise ten seconds later.
-        [ "$a" != a1 ] || sleep 1.2
-        tell "$a" add "$1" router 10.0.0.1 router 10.0.0.2 weight "${weight[$a]}" assign "$2" priority 10 protocol 6 \
-            hash dst_ip mask_dst_ip 0x3f >/dev/null || lab_die "$a refuses group $1"
+        [ "$a" != a1 ] || lab_sleep 1.2
+        groups_of[$a]+=$(lab_group "$1" 10.0.0.1 10.0.0.2 "weight=${weight[$a]}" "assign_method=$2" mask_dst_ip=0x3f)$'\n'
+        lab_configure "$a" "${groups_of[$a]}" || lab_die "$a refuses group $1"
     done
 }
 
@@ -58,11 +57,14 @@ group_add() { # ID ASSIGNMENT
 
 declare -A owners_of members_of brief_of
 look() { # at everything, once
-    local id a
+    local id a state designated
     for id in 51 52; do
         owners_of[$id]=$(lab_ctl r1 owners $id)
         members_of[$id]=$(lab_ctl r1 members $id; echo; lab_ctl r2 members $id)
-        for a in "${appliances[@]}"; do brief_of[$a/$id]=$(tell "$a" brief $id); done
+    done
+    for a in "${appliances[@]}"; do
+        while read -r id state designated; do brief_of[$a/$id]="$state $designated"; done < <(lab_manage "$a" show |
+            jq -r '.groups[] | "\(.id) \(.state) \(if .designated then "designated" else "" end)"')
     done
 }
 
@@ -104,7 +106,7 @@ picture() {
         printf '  routers     r1 10.0.0.1   r2 10.0.0.2\033[K\n'
         for a in a1 a2; do
             text="gone"
-            [ -n "${LAB_INIT[$a]-}" ] && text="${brief_of[$a/51]%% *}" && [[ ${brief_of[$a/51]} = *designated* ]] && text+=", designated"
+            [ -n "${LAB_INIT[$a]-}" ] && text=${brief_of[$a/51]-} && text=${text%% *} && [[ ${brief_of[$a/51]-} = *designated* ]] && text+=", designated"
             printf "  appliance   \033[48;5;${colour[${address[$a]}]}m %s \033[0m %s  weight %-3s  %s\033[K\n" "${letter[${address[$a]}]}" \
                 "${address[$a]}" "${weight[$a]}" "$text"
         done
@@ -171,7 +173,7 @@ table_of() { # GROUP ADDRESS : every slot has an owner, by a table of that appli
     [ "$key" = "$2" ] && [[ " $owners " != *' - '* ]]
 }
 asked() { [[ ${members_of[51]} = *' 1'$'\n'* ]] || [[ ${members_of[51]} = *' 1' ]] || members_are 51 2; }
-designated() { [[ ${brief_of[$1/51]} = *designated* ]] && [[ ${brief_of[$1/52]} = *designated* ]]; } # APPLIANCE
+designated() { [[ ${brief_of[$1/51]-} = *designated* ]] && [[ ${brief_of[$1/52]-} = *designated* ]]; } # APPLIANCE
 
 # ---- the story
 
@@ -184,11 +186,7 @@ lab_router r1 10.0.0.1
 lab_router r2 10.0.0.2
 for a in a1 a2; do
     lab_appliance $a "${address[$a]}"
-    lab_start $a host wccp_engine_host
-    lab_start $a tunneld tunneld
-done
-for a in a1 a2; do
-    for _ in $(seq 50); do tell $a show >/dev/null && break; sleep 0.1; done
+    lab_appliance_start $a
 done
 group_add 51 hash
 step='Here-I-Am, I-See-You: an appliance is in once it has echoed what a router sent'
@@ -220,7 +218,6 @@ await 40 1 'the mask table of B' table_of 52 10.0.0.102
 show_table 51
 show_table 52
 [ -z "$capture" ] || { lab_capture_end; chmod a+r "$capture"; echo "packets: $capture"; }
-lab_stop a2 host || lab_die "the appliance ended with $?"
-lab_stop a2 tunneld || lab_die "tunneld ended with $?"
+lab_end a2 || lab_die "the appliance did not end in order"
 if [ -n "$plain" ]; then echo "$(clock) done"; fi
 exit 0

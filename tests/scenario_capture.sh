@@ -1,9 +1,10 @@
 #!/bin/bash
-# The demo runs to its end without a terminal, and tshark finds nothing wrong in the packets that it kept.
+# The demo runs to its end without a terminal, by the faster clock, and tshark finds nothing wrong in the packets that it kept.
 #   scenario_capture.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
 export WCCP_BIN=${1:-$top/build/release/bin}
+export LAB_SPEED=${LAB_SPEED:-8}
 command -v tshark >/dev/null && command -v tcpdump >/dev/null || { echo "no tshark or no tcpdump"; exit 77; }
 scratch=$(mktemp -d)
 trap 'rm -rf "$scratch"' EXIT
