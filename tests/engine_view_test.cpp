@@ -274,107 +274,78 @@ TEST_F(ViewTest, EarlierBucketBitsStayWhereNoneAreAssigned) {
     EXPECT_EQ(a->view_appliances[0].bucket_bits[3], 8u);
 }
 
-// What routers assign, step by step: from, to us, to anybody; then the routers that redirect here, and the
-// state.
-struct redirect_step {
-    be32 from;
-    uint16_t self, total;
-    uint8_t redirecting;
-    uint32_t state;
-};
-
-struct RedirectTest : ViewTest {
-    void SetUp() override {
-        for (const be32 id : {ROUTER_A, ROUTER_B, ROUTER_C})
-            report(id, {{US, 100}, {host(2), 100}});
+// What routers assign to us and to anybody, step by step; then how many redirect here, the state, and the
+// line.
+TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
+    const be32 A = ROUTER_A, B = ROUTER_B, C = ROUTER_C;
+    constexpr uint32_t INIT = WCCP_STATE_INIT, ACTIVE = WCCP_STATE_ACTIVE, BACKUP = WCCP_STATE_BACKUP;
+    const struct {
+        be32 from;
+        uint16_t self, total;
+        uint8_t redirecting;
+        uint32_t state, transitions;
+        std::string line;
+    } steps[] = {
+        {A, 128, 256, 1, ACTIVE, 1, "first router to self (router id 10.0.0.201 )"},
+        {A, 100, 256, 1, ACTIVE, 1, ""},
+        {B, 128, 256, 2, ACTIVE, 1, ""},
+        {A, 0, 256, 1, ACTIVE, 1, ""},
+        {A, 0, 200, 1, ACTIVE, 1, ""},
+        // It assigns elsewhere itself, then A still does, then nobody.
+        {B, 0, 256, 0, BACKUP, 2, "last router stopped redirecting to self. (router id 10.0.0.202)"},
+        {B, 256, 256, 1, ACTIVE, 3, "first router to self (router id 10.0.0.202 )"},
+        {B, 0, 0, 0, BACKUP, 4, "this rtr (id 10.0.0.202) does not redirect. but another router does"},
+        {A, 0, 0, 0, INIT, 4, "no routers redirecting to group (router id 10.0.0.201)"},
+        // The only ones stop.
+        {A, 256, 256, 1, ACTIVE, 5, "first router to self (router id 10.0.0.201 )"},
+        {B, 256, 256, 2, ACTIVE, 5, ""},
+        {B, 0, 0, 1, ACTIVE, 5, ""},
+        {A, 0, 0, 0, INIT, 5, "rtr does not redirect. no redirecting routers (router id 10.0.0.201)"},
+        // Everything elsewhere from the start.
+        {A, 0, 256, 0, BACKUP, 6, "router id 10.0.0.201 is redirecting to other  appliance(s)."},
+        {B, 0, 256, 0, BACKUP, 6, ""},
+        {A, 0, 0, 0, BACKUP, 6, ""},
+        {C, 0, 64, 0, BACKUP, 6, ""},
+        {B, 0, 0, 0, BACKUP, 6, ""},
+        {C, 0, 0, 0, INIT, 6, "no routers redirecting to group (router id 10.0.0.203)"},
+    };
+    for (const be32 id : {A, B, C})
+        report(id, {{US, 100}, {host(2), 100}});
+    log_lines log;
+    const auto assign = [this](be32 id, uint16_t self, uint16_t total) {
+        wccp_sending_router *from = router(id);
+        // As a view update leaves it: the rest goes to the other appliance.
+        from->view_appliances[0].buckets_assigned = self;
+        from->view_appliances[1].buckets_assigned = static_cast<uint16_t>(total - self);
+        const wccp_assign_summary hash = {1, self, total}, mask = {};
+        EXPECT_EQ(wccp_update_appliance_redirect_status(group, from, &hash, &mask), 0);
+        EXPECT_EQ(from->self_buckets, self);
+        EXPECT_EQ(from->total_buckets, total);
+    };
+    for (const auto &step : steps) {
+        SCOPED_TRACE(&step - steps);
+        assign(step.from, step.self, step.total);
+        EXPECT_EQ(group->redirecting_routers, step.redirecting);
+        EXPECT_EQ(group->state_flags & WCCP_STATE_MASK, step.state);
+        EXPECT_EQ(group->transitions, step.transitions);
+        const std::string said = log.take(), begin = "WCCP GRP 51: redirect: ";
+        EXPECT_EQ(said.find(begin) == std::string::npos, step.line.empty()) << said;
+        EXPECT_TRUE(step.line.empty() || said.find(begin + step.line) != std::string::npos) << said;
     }
-    // The texts of the redirect lines that the steps bring.
-    std::vector<std::string> follow(const std::vector<redirect_step> &steps) {
-        log_lines log;
-        std::vector<std::string> told;
-        for (size_t i = 0; i < steps.size(); i++) {
-            const redirect_step &step = steps[i];
-            wccp_sending_router *from = router(step.from);
-            // As a view update leaves it: the rest goes to the other appliance.
-            from->view_appliances[0].buckets_assigned = step.self;
-            from->view_appliances[1].buckets_assigned = static_cast<uint16_t>(step.total - step.self);
-            const wccp_assign_summary hash = {1, step.self, step.total}, mask = {};
-            EXPECT_EQ(wccp_update_appliance_redirect_status(group, from, &hash, &mask), 0);
-            EXPECT_EQ(group->redirecting_routers, step.redirecting) << "step " << i;
-            EXPECT_EQ(group->state_flags & WCCP_STATE_MASK, step.state) << "step " << i;
-            EXPECT_EQ(from->self_buckets, step.self);
-            EXPECT_EQ(from->total_buckets, step.total);
-            const std::string text = log.take(), begin = "WCCP GRP 51: redirect: ";
-            if (const size_t at = text.find(begin); at != std::string::npos)
-                told.push_back(
-                    text.substr(at + begin.size(), text.find_first_of("\n<", at) - at - begin.size()));
-        }
-        return told;
-    }
-};
-using lines = std::vector<std::string>;
-
-TEST_F(RedirectTest, TheFirstRouterMakesActiveAndTheLastDecides) {
-    EXPECT_EQ(follow({
-                  {ROUTER_A, 128, 256, 1, WCCP_STATE_ACTIVE},
-                  {ROUTER_A, 100, 256, 1, WCCP_STATE_ACTIVE},
-                  {ROUTER_B, 128, 256, 2, WCCP_STATE_ACTIVE},
-                  {ROUTER_A, 0, 256, 1, WCCP_STATE_ACTIVE},
-                  {ROUTER_A, 0, 200, 1, WCCP_STATE_ACTIVE},
-                  {ROUTER_B, 0, 256, 0, WCCP_STATE_BACKUP}, // it assigns elsewhere itself
-                  {ROUTER_B, 256, 256, 1, WCCP_STATE_ACTIVE},
-                  {ROUTER_B, 0, 0, 0, WCCP_STATE_BACKUP}, // A still assigns elsewhere
-                  {ROUTER_A, 0, 0, 0, WCCP_STATE_INIT},   // nobody does any more
-              }),
-              (lines{
-                  "first router to self (router id 10.0.0.201 )",
-                  "last router stopped redirecting to self. (router id 10.0.0.202)",
-                  "first router to self (router id 10.0.0.202 )",
-                  "this rtr (id 10.0.0.202) does not redirect. but another router does",
-                  "no routers redirecting to group (router id 10.0.0.201)",
-              }));
-    EXPECT_EQ(group->transitions, 4u);
-    EXPECT_EQ(follow({
-                  {ROUTER_A, 256, 256, 1, WCCP_STATE_ACTIVE},
-                  {ROUTER_B, 256, 256, 2, WCCP_STATE_ACTIVE},
-                  {ROUTER_B, 0, 0, 1, WCCP_STATE_ACTIVE},
-                  {ROUTER_A, 0, 0, 0, WCCP_STATE_INIT},
-              }),
-              (lines{
-                  "first router to self (router id 10.0.0.201 )",
-                  "rtr does not redirect. no redirecting routers (router id 10.0.0.201)",
-              }));
-}
-
-TEST_F(RedirectTest, EverythingElsewhereFromTheStartIsBackup) {
-    EXPECT_EQ(follow({
-                  {ROUTER_A, 0, 256, 0, WCCP_STATE_BACKUP},
-                  {ROUTER_B, 0, 256, 0, WCCP_STATE_BACKUP},
-                  {ROUTER_A, 0, 0, 0, WCCP_STATE_BACKUP},
-                  {ROUTER_C, 0, 64, 0, WCCP_STATE_BACKUP},
-                  {ROUTER_B, 0, 0, 0, WCCP_STATE_BACKUP},
-                  {ROUTER_C, 0, 0, 0, WCCP_STATE_INIT},
-              }),
-              (lines{
-                  "router id 10.0.0.201 is redirecting to other  appliance(s).",
-                  "no routers redirecting to group (router id 10.0.0.203)",
-              }));
-    EXPECT_EQ(group->transitions, 1u);
     // Nothing is taken from an empty count, as a start of the group leaves it.
-    router(ROUTER_A)->self_buckets = router(ROUTER_A)->total_buckets = 9;
-    follow({{ROUTER_A, 0, 256, 0, WCCP_STATE_BACKUP}});
-    router(ROUTER_A)->self_buckets = 9;
-    follow({{ROUTER_A, 0, 0, 0, WCCP_STATE_INIT}});
-}
-
-TEST_F(RedirectTest, AMapWinsAndTheSameAgainCountsNothing) {
-    wccp_sending_router *a = router(ROUTER_A);
+    for (const uint16_t total : {uint16_t{256}, uint16_t{0}}) {
+        router(A)->self_buckets = router(A)->total_buckets = 9;
+        assign(A, 0, total);
+        EXPECT_EQ(group->redirecting_routers, 0);
+    }
+    // A map wins over the hash, and the same again counts nothing.
     const wccp_assign_summary hash = {1, 0, 0}, mask = {1, 8, 16};
+    const uint32_t checks = group->alarm_assign_sched;
     for (int round = 0; round < 2; round++) {
-        EXPECT_EQ(wccp_update_appliance_redirect_status(group, a, &hash, &mask), 0);
-        EXPECT_EQ(a->self_buckets, 8);
-        EXPECT_EQ(a->total_buckets, 16);
-        EXPECT_EQ(group->alarm_assign_sched, 1u);
+        EXPECT_EQ(wccp_update_appliance_redirect_status(group, router(A), &hash, &mask), 0);
+        EXPECT_EQ(router(A)->self_buckets, 8);
+        EXPECT_EQ(router(A)->total_buckets, 16);
+        EXPECT_EQ(group->alarm_assign_sched, checks + 1);
     }
     EXPECT_EQ(group->redirecting_routers, 1);
 }
