@@ -15,8 +15,8 @@
 //
 // All groups of an interface say Here-I-Am in one tick, with the engine lock held, and their routers answer
 // at once: with 256 groups of 32 routers some 8000 datagrams wait for that tick to end. The kernel's usual
-// buffer holds a few hundred; the rest would be lost at every tick, and routers time out. What a larger buffer
-// may hold is the kernel's memory and is taken only while it is full.
+// buffer holds a few hundred; the rest would be lost at every tick, and routers time out. What a larger
+// buffer may hold is the kernel's memory and is taken only while it is full.
 //
 // A datagram that is longer than the buffer is cut to it, and the tail is gone: what is handed on has the
 // length of the buffer, and the check of the message's own length decides.
