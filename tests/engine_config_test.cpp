@@ -274,6 +274,7 @@ TEST_F(Config, AStopSaysFarewellAndForgetsAllButTheConfiguration) {
     group->change_number = group->dsg_key_change = group->pending_acks = 9;
     group->dsg_appliances[31].weight = 5;
     group->rx_icus = 12;
+    group->router_alarm_timer.countdown = 7;
     add_router(group, "10.0.0.2")->flags = WCCP_RTR_TWO_WAY;
     auto *appliance = static_cast<wccp_view_appliance *>(wccp_calloc(1, sizeof(wccp_view_appliance)));
     list_push_head(&group->appliance_view, appliance);

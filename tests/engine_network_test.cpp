@@ -16,6 +16,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstring>
+#include <utility>
 
 #include "engine/cthread.h"
 #include "engine/wccp_config.h"
@@ -215,7 +216,9 @@ TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
     group.mcast_configured = 1;
     group.mcast_ipa = ipa("224.0.1.5");
     ASSERT_EQ(wccp_join_mc_grp(wan, group.mcast_ipa), 0);
+    const int32_t unicast = std::exchange(wan->ucast_fd, -1); // the other socket has TTL and interface
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 120);
+    wan->ucast_fd = unicast;
     EXPECT_EQ(pkt.ipa, group.mcast_ipa);
     const datagram got = receive_datagram(listener);
     EXPECT_EQ(got.bytes, expected);
