@@ -1,9 +1,10 @@
 // "mgmtctl show": one picture, or one that stays live.
 //
-// A live picture is drawn anew each second and when mgmtd tells of something, at most ten times a second. On
-// a terminal it has the other screen and is written over in one piece; it gives the terminal back when a
-// signal ends or stops it. In a file or a pipe it is a line for whatever has changed, with the time, and as
-// JSON a picture a line. When mgmtd goes, a live picture says so and looks for it once a second.
+// A live picture is drawn anew each second and when mgmtd tells of something, at most ten times a second; a
+// picture that took long to gather leaves mgmtd and wccpd alone for longer than it took. On a terminal it has
+// the other screen and is written over in one piece; it gives the terminal back when a signal ends or stops
+// it. In a file or a pipe it is a line for whatever has changed, with the time, and as JSON a picture a line.
+// When mgmtd goes, a live picture says so and looks for it once a second.
 #include <algorithm>
 #include <cerrno>
 #include <clocale>
@@ -200,10 +201,10 @@ static bool add_interests(ctl_session *session, std::string *out_reason) {
     });
 }
 
-// Until it is time for the next picture. False: the session has ended.
-static bool wait_for_news(ctl_session *session, std::string *out_reason) {
+// Until it is time for the next picture, after one that cost so long. False: the session has ended.
+static bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reason) {
     const int64_t began = now_ms();
-    int64_t until = began + PERIOD_MS;
+    int64_t until = began + std::max(PERIOD_MS, 4 * cost_ms);
     while (!ctl_stop_signal && !pause_wanted) {
         ctl_event event;
         const int came = ctl_next_event(session, std::max<int64_t>(until - now_ms(), 0), &event, out_reason);
@@ -211,7 +212,7 @@ static bool wait_for_news(ctl_session *session, std::string *out_reason) {
             return false;
         if (came == 0)
             return true;
-        until = std::min(until, began + BURST_MS);
+        until = std::min(until, began + std::max(BURST_MS, cost_ms));
     }
     return true;
 }
@@ -228,15 +229,17 @@ static int watch(viewer *self) {
                 session = nullptr;
             }
         }
+        const int64_t began = now_ms();
         if (session)
             shown = look(*self, session);
+        const int64_t cost_ms = now_ms() - began;
         if (ctl_stop_signal)
             break;
         if (self->terminal && !self->options.json)
             take_screen(self, true);
         show_one(self, shown);
         std::string reason;
-        if (session && (!shown.unreachable.empty() || !wait_for_news(session, &reason))) {
+        if (session && (!shown.unreachable.empty() || !wait_for_news(session, cost_ms, &reason))) {
             ctl_close(session);
             session = nullptr;
         }

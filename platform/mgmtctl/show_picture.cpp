@@ -1,9 +1,9 @@
 // Gathering the picture: what wccpd's monitoring nodes, mgmtd's alarms and roles, and the configuration say.
 //
 // A group costs a walk of its nodes (its texts among them), one of its routers with their appliances, one of
-// its configuration, and two queries for each appliance, whose numbers cannot be walked. When more groups
-// stand than a screen has room for, they come briefly: without texts and appliances, which leaves wccpd's
-// engine lock alone. The number of queries has an end, whatever is configured.
+// its configuration, and two queries for each appliance, whose numbers cannot be walked. wccpd answers node
+// by node under its engine lock; so when more groups stand than a screen has room for, each comes briefly,
+// with six nodes: the share is then that at its first router. The number of queries has an end in any case.
 //
 // Each answer shows its own moment. A group, router or appliance that is gone by the time it is asked for
 // just has no nodes, and is left out. Once wccpd has not answered, it is not asked again for this picture.
@@ -148,6 +148,8 @@ static const node_row<picture_group> group_rows[] = {
      }},
     {"uptime", [](picture_group *g, const std::string &v) { g->uptime_ms = number_of<uint64_t>(v, 0); }},
     {"app_id", [](picture_group *g, const std::string &v) { g->address = clean_text(v, 15); }},
+    {"num_routers",
+     [](picture_group *g, const std::string &v) { g->routers_heard = number_of<size_t>(v, 0); }},
 };
 
 static const node_row<picture_group> config_rows[] = {
@@ -289,47 +291,66 @@ static void sort_appliances(picture_group *group) {
                 owner = appliance_place(group, sorted[static_cast<size_t>(owner)].address);
 }
 
-// Alone, or briefly: the nodes that cost little.
-static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
-    std::vector<std::string> configured;
-    if (group->configured && !gather_config(work, group, &configured))
-        return false;
-    const std::string root = group_root(STATES, group->id);
-    std::string texts[2];
+namespace {
+struct group_texts {
+    std::string group, assignment;
     uint32_t appliances = 0;
-    std::vector<ctl_binding> nodes;
-    ctl_reply reply;
-    if (in_wccpd && !work->shown.brief) {
-        if (!work->ask_wccpd(ctl_walk::children, root, &reply))
-            return false;
-        nodes = std::move(reply.bindings);
-    }
-    for (const char *node : {"/oper", "/uptime", "/app_id"})
-        if (in_wccpd && work->shown.brief) {
-            if (!work->ask_wccpd(ctl_walk::node, root + node, &reply))
-                return false;
-            nodes.insert(nodes.end(), reply.bindings.begin(), reply.bindings.end());
-        }
-    for (const ctl_binding &binding : nodes) {
+};
+} // namespace
+
+static void take_group_nodes(const std::string &root, const ctl_reply &reply, picture_group *group,
+                             group_texts *out) {
+    for (const ctl_binding &binding : reply.bindings) {
         const std::vector<std::string> parts = parts_below(root, binding.name);
         if (parts.size() != 1)
             continue;
         take_node(group_rows, parts[0], binding.value, group);
         if (parts[0] == "num_appliances")
-            appliances = number_of<uint32_t>(binding.value, 0);
+            out->appliances = number_of<uint32_t>(binding.value, 0);
         else if (parts[0] == "debug")
-            texts[0] = binding.value;
+            out->group = binding.value;
         else if (parts[0] == "assignment")
-            texts[1] = binding.value;
+            out->assignment = binding.value;
     }
-    if (!gather_routers(work, group, configured))
-        return false;
-    if (work->shown.brief)
+}
+
+static bool gather_briefly(gathering *work, picture_group *group, const std::string &root) {
+    ctl_reply reply;
+    group_texts unused;
+    for (const char *node : {"/oper", "/uptime", "/app_id", "/num_routers"}) {
+        if (!work->ask_wccpd(ctl_walk::node, root + node, &reply))
+            return false;
+        take_group_nodes(root, reply, group, &unused);
+    }
+    if (group->routers_heard == 0)
         return true;
-    if (!gather_weights(work, group, appliances))
+    if (!work->ask_wccpd(ctl_walk::node, root + "/router/1/appliance/" + group->address + "/load_dist",
+                         &reply))
         return false;
-    take_group_text(texts[0], group);
-    take_assignment_text(texts[1], group);
+    if (!reply.bindings.empty()) {
+        picture_router first;
+        take_load(group, &first, group->address, reply.bindings[0].value);
+    }
+    return true;
+}
+
+static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
+    std::vector<std::string> configured;
+    if (group->configured && !gather_config(work, group, &configured))
+        return false;
+    group->routers_configured = configured.size();
+    const std::string root = group_root(STATES, group->id);
+    if (work->shown.brief)
+        return !in_wccpd || gather_briefly(work, group, root);
+    ctl_reply reply;
+    group_texts texts;
+    if (in_wccpd && !work->ask_wccpd(ctl_walk::children, root, &reply))
+        return false;
+    take_group_nodes(root, reply, group, &texts);
+    if (!gather_routers(work, group, configured) || !gather_weights(work, group, texts.appliances))
+        return false;
+    take_group_text(texts.group, group);
+    take_assignment_text(texts.assignment, group);
     finish_shares(group);
     sort_appliances(group);
     return true;

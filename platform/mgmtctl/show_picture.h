@@ -56,6 +56,7 @@ struct picture_group {
     uint64_t uptime_ms = 0;
     std::string address; // of this appliance in the group
     std::string link;    // of its first interface: "up", "down"; empty: unknown
+    size_t routers_configured = 0, routers_heard = 0;
     std::vector<picture_router> routers;
     std::vector<picture_appliance> appliances;
     std::vector<picture_table> tables;
@@ -67,7 +68,7 @@ struct picture {
     std::string status, mode; // of the daemon; of the system
     std::vector<picture_group> groups;
     size_t groups_total = 0;
-    bool brief = false; // the groups come without weights, tables and link
+    bool brief = false; // groups without routers, weights, tables and link, and with the own share alone
     size_t roles_active = 0, roles_backup = 0;
     std::vector<picture_alarm> alarms;
     size_t alarms_total = 0;

@@ -142,9 +142,10 @@ static size_t connected_routers(const picture_group &group) {
                                              [](const auto &r) { return r.connection == "two-way"; }));
 }
 
-static std::string one_line(const picture_group &group) {
-    std::string text =
-        "  routers " + std::to_string(connected_routers(group)) + "/" + std::to_string(group.routers.size());
+static std::string one_line(const picture_group &group, bool brief) {
+    const size_t reached = brief ? group.routers_heard : connected_routers(group);
+    const size_t all = brief ? std::max(group.routers_configured, reached) : group.routers.size();
+    std::string text = "  routers " + std::to_string(reached) + "/" + std::to_string(all);
     if (const picture_appliance *self = own(group)) {
         text += "  share " + share_words(*self);
         if (self->asked_percent >= 0)
@@ -166,7 +167,7 @@ std::vector<std::string> draw_lines(const picture &shown) {
         out.push_back("alarm  " + alarm_words(alarm));
     for (const picture_group &group : shown.groups)
         out.push_back("group " + std::to_string(group.id) + "  " + state_words(shown, group).first +
-                      one_line(group));
+                      one_line(group, shown.brief));
     return out;
 }
 
@@ -397,7 +398,7 @@ static std::vector<std::string> draw_briefly(const picture &shown, const screen_
         add_cells(&line, format("%-20s", words.c_str()), how);
         add_cells(&line, in_alarm(shown, group) ? " !" : "  ", style::bad);
         add_cells(&line, group.uptime_ms ? format("  up %-11s", duration_text(group.uptime_ms).c_str()) : "");
-        add_cells(&line, one_line(group));
+        add_cells(&line, one_line(group, shown.brief));
         on.end(&line);
         told++;
     }
