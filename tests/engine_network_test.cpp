@@ -422,7 +422,7 @@ TEST_F(Network, AnAddressChangesGoesAndComes) {
     make_active(known);
     const int32_t fd = wan->ucast_fd;
     set_address("");
-    EXPECT_TRUE(engine.sent_to("10.0.0.2").empty()) << "nothing to send a farewell from";
+    EXPECT_TRUE(engine.sent_to("10.0.0.2").empty() && known->tx_link_drops == 1) << "no farewell is tried";
     EXPECT_TRUE(is_zero(known->appliance_ipa));
     EXPECT_EQ(known->hia_timer.active, 0);
     EXPECT_EQ(wan->ready_flags, WCCP_LINK_READY);
