@@ -8,12 +8,15 @@ export LAB_MARK=lab-$$-$RANDOM
 failed=0
 
 as=()
+# What the lab runs: the programs of its appliance, until it is interrupted.
+whole='source "$LAB_HOME/topology.sh"; eval "${nodes//declare/declare -g}"
+    lab_appliance_start a1 "$(lab_group 51 10.0.0.1)"; sleep 60'
 marked() { # the processes of our labs
     grep -lzx "LAB_OF_TEST=$LAB_MARK" /proc/[0-9]*/environ 2>/dev/null | cut -d/ -f3
 }
 interrupt() { # SIGNAL SECONDS
     "${as[@]}" env --default-signal=INT LAB_OF_TEST="$LAB_MARK" \
-        "$top/lab/topology.sh" --routers 1 --appliances 1 sleep 60 </dev/null >/dev/null 2>&1 &
+        "$top/lab/topology.sh" --routers 1 --appliances 1 bash -c "$whole" </dev/null >/dev/null 2>&1 &
     local shell=$!
     sleep "$2"
     kill -s "$1" $shell
