@@ -100,9 +100,13 @@ static lc_status make_loop() {
     return LC_OK;
 }
 
+static lc_status qv_alm_mgmt_init_client() {
+    return mgmt_client_init(&qv_alm_client, qv_alm_mgmt_handle_session_close);
+}
+
 static lc_status start_session(const char *client_name) {
     CHECK_STATUS(make_loop());
-    CHECK_STATUS(mgmt_client_init(&qv_alm_client, qv_alm_mgmt_handle_session_close));
+    CHECK_STATUS(qv_alm_mgmt_init_client());
     CHECK_STATUS(
         bn_set_global_callback_query_response_msg(qv_alm_instance, qv_alm_mgmt_handle_response, nullptr));
     CHECK_STATUS(

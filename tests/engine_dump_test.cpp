@@ -350,7 +350,7 @@ TEST_F(EngineDump, WordsForOtherStates) {
     EXPECT_EQ(row("WCCP raised alarms"), "none");
     group->raised_alarms = WCCP_ALARM_ASSIGNMENT;
     EXPECT_EQ(row("WCCP raised alarms"), "flag: 0x2 assign tbl mismatch");
-    first->flags = WCCP_RTR_ONE_WAY;
+    first->flags = WCCP_RTR_ONE_WAY | WCCP_RTR_ASSIGN_UNACKED;
     EXPECT_EQ(row("WCCP router connected"), "one-way");
     memset(group->password, 0, sizeof group->password);
     EXPECT_EQ(row("WCCP password"), " 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, 0x0, ");
