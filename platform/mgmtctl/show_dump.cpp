@@ -114,7 +114,9 @@ static void finish_table(picture_table *table) {
 void take_assignment_text(const std::string &text, picture_group *inout) {
     assignment_reader in = {.group = inout, .router = {}, .tables = {}};
     each_row(text, [&](const dump_row &row) { take_row(&in, row); });
-    for (auto &[router, table] : in.tables) {
+    for (auto &reported : in.tables) {
+        const std::string &router = reported.first;
+        picture_table &table = reported.second; // names of their own, for clang 14 lets no lambda see parts
         finish_table(&table);
         const bool owned =
             std::any_of(table.owners.begin(), table.owners.end(), [](int o) { return o >= 0; });
