@@ -207,8 +207,8 @@ lab_start() { # NODE NAME PROGRAM ARGUMENTS...
     local node=$1 name=$2 program=$3; shift 3
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
     case $program in
-    */*) ;;
-    mgmtd) program=$WCCP_BIN/$program; LAB_CLOCK=() ;;
+    */*) LAB_CLOCK=() ;;
+    mgmtd | mgmtctl) program=$WCCP_BIN/$program; LAB_CLOCK=() ;;
     *) program=$WCCP_BIN/$program; lab_clock ;;
     esac
     (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net --mount --root --ipc --pid "${LAB_CLOCK[@]}" "$program" "$@") \
