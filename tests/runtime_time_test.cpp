@@ -64,7 +64,7 @@ TEST_F(Time, ComesBack) {
         const std::string text = TEXT(lt_datetime_us_to_str(us, 0, out));
         EXPECT_TRUE(lt_str_to_datetime_us(text.c_str(), &back) == LC_OK && back == us) << text;
     }
-    for (int64_t us = 1; us < 86400000000; us = us * 3 + 29) {
+    for (int64_t us = 1; us < 86400000000; us = us < 600 ? us + 1 : us * 3 + 29) {
         const std::string day = TEXT(lt_daytime_us_to_str(us, out)), span = TEXT(lt_dur_us_to_str(us, out));
         EXPECT_TRUE(lt_str_to_daytime_us(day.c_str(), &back) == LC_OK && back == us) << day;
         EXPECT_TRUE(lt_str_to_dur_us(span.c_str(), &back) == LC_OK && back == us) << span;
