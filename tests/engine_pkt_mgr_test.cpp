@@ -98,7 +98,9 @@ protected:
 TEST_F(Messages, EachFaultIsCountedInItsPlace) {
     using counters = std::array<uint32_t, 8>;
     // all, group; I-See-Yous, failed; queries, failed; security mismatches, service mismatches
-    const counters none = {}, all = {1}, bad_icu = {0, 0, 1, 1}, bad_service = {0, 0, 1, 1, 0, 0, 0, 1};
+    const counters none = {}, all = {1}, bad_option = {1, 1, 0, 0, 0, 0, 1};
+    const counters icu_alone = {0, 0, 1}, bad_icu = {0, 0, 1, 1}, bad_service = {0, 0, 1, 1, 0, 0, 0, 1};
+    const counters query_alone = {0, 0, 0, 0, 1}, bad_query = {0, 0, 0, 0, 1, 1};
     const bytes good = icu(1, view(1, {{100, 100, 0}}));
     const wire_bytes no_view = view(1, {});
     const auto changed = [&good](size_t at, uint8_t value) {
@@ -128,10 +130,7 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {with({}), 1, all, "WCCP: unloading security info failed."},
         {with({security}), 1, all, "WCCP: unloading service info failed."},
         {with({security, service(52)}), 1, all, "WCCP GRP 52: rxed service group (52) is not configured."},
-        {changed(15, 2),
-         1,
-         {1, 1, 0, 0, 0, 0, 1},
-         "WCCP GRP 51: rxed mismatch security opt: 2 configured opt: 0"},
+        {changed(15, 2), 1, bad_option, "WCCP GRP 51: rxed mismatch security opt: 2 configured opt: 0"},
         {with({security, service()}), 0, bad_icu, "WCCP: unloading router identity failed."},
         {with({security, service(), identity(1)}), 0, bad_icu, "WCCP: unloading router view failed."},
         {with({security, service(51, 201, 17, 3), identity(1)}), 0, bad_service,
@@ -149,20 +148,13 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {icu(1, no_view, {hex("000e 00")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {icu(1, no_view, {by_hash, odd_command, odd_unknown, odd_unknown}), 0, bad_icu,
          "WCCP GRP 51: ICU bogus packet  (too many optional components)."},
-        {icu(1, no_view, {}), 0, {0, 0, 1}, "incompatible capabilities"}, // GRE only
+        {icu(1, no_view, {}), 0, icu_alone, "incompatible capabilities"}, // GRE only
         {icu(1, no_view, {capabilities(2, 1, 0)}), 0, bad_icu, "incompatible capabilities"},
-        {router_0, 0, {0, 0, 1}, ""},
-        {wire_message(13, {security, service()}),
-         0,
-         {0, 0, 0, 0, 1, 1},
-         "WCCP: unloading router query failed."},
-        {query(1, 100),
-         0,
-         {0, 0, 0, 0, 1},
+        {router_0, 0, icu_alone, ""},
+        {wire_message(13, {security, service()}), 0, bad_query, "WCCP: unloading router query failed."},
+        {query(1, 100), 0, query_alone,
          "WCCP GRP 51: removal query request. cannot find router. (router id 10.0.0.1)"},
-        {query(1, 101),
-         0,
-         {0, 0, 0, 0, 1},
+        {query(1, 101), 0, query_alone,
          "WCCP GRP 51: removal query is not for us. sending router id: 10.0.0.1 target appliance: "
          "10.0.0.101"},
     };
