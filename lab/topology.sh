@@ -220,7 +220,8 @@ lab_start() { # NODE NAME PROGRAM ARGUMENTS...
 lab_pid() { # NODE NAME
     local pid=${LAB_PID[$1/$2]-}
     [ -n "$pid" ] || lab_die "there is no $2 in $1"
-    if [ "$2" = router ]; then echo "$pid"; else cat "/proc/$pid/task/$pid/children" 2>/dev/null; fi
+    if [ "$2" != router ]; then pid=$(cat "/proc/$pid/task/$pid/children" 2>/dev/null); fi
+    echo "${pid%% *}"
 }
 lab_alive() { # NODE NAME
     kill -0 "${LAB_PID[$1/$2]}" 2>/dev/null

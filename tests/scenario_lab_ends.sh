@@ -1,6 +1,7 @@
 #!/bin/bash
-# A lab that is interrupted, at whatever moment and by whatever signal, leaves no process behind; as an ordinary user
-# as well, where the kernel allows that.   scenario_lab_ends.sh DIRECTORY_OF_THE_PROGRAMS
+# The lab itself: its clock, and its end. A lab that is interrupted, at whatever moment and by whatever signal, leaves
+# no process behind; as an ordinary user as well, where the kernel allows that.
+#   scenario_lab_ends.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
 export WCCP_BIN=${1:-$top/build/release/bin}
@@ -45,6 +46,16 @@ out=$(LAB_OF_TEST=$LAB_MARK "$top/lab/topology.sh" --routers 2 --appliances 2 \
     bash -c '"$WCCP_BIN/wccp_router" ctl "$LAB/r2.ctl" show; exit 7') && status=0 || status=$?
 [ "$status" = 7 ] && [[ $out = *'"router":"10.0.0.2"'* ]] || { echo "status $status, output: $out" >&2; failed=1; }
 [ -z "$(marked)" ] || { echo "a lab that ended leaves processes" >&2; failed=1; }
+
+# The faster clock: a sleep takes its part of the time, unless it is too short to be about a protocol.
+fast=(env "LD_PRELOAD=$(dirname "$WCCP_BIN")/lib/libfast_clock.so" FAST_CLOCK=10)
+took() { # milliseconds
+    local began=${EPOCHREALTIME/[.,]/}
+    "$@"
+    echo $(((${EPOCHREALTIME/[.,]/} - began) / 1000))
+}
+long=$(took "${fast[@]}" sleep 5) short=$(took "${fast[@]}" sleep 0.019)
+[ "$long" -ge 500 ] && [ "$long" -lt 3000 ] && [ "$short" -ge 19 ] || { echo "5 s took $long ms, 19 ms $short" >&2; failed=1; }
 
 round
 if [ "$(id -u)" = 0 ]; then
