@@ -105,7 +105,8 @@ TEST(Groups, AGroupThatIsCreatedAgainKeepsWhatWasSet) {
     EXPECT_EQ(mgmtd.sent(1), "remove =;");
     EXPECT_EQ(mgmtd.sent(2), "create =51;create /interface=eth0;create /password=a 'b;create "
                              "/router/1/ipaddr=10.0.0.2;create /weight=7;");
-    EXPECT_EQ(mgmtd.run({"set", "51", "interface", "none"}).done, "recreated");
+    EXPECT_NE(mgmtd.run({"set", "51", "interface", "none"}).note.find("; without an interface"),
+              std::string::npos);
     mgmtd.nodes[ROOT + "/policy_grp"] = "5";
     EXPECT_EQ(mgmtd.run({"set", "51", "policy", "none"}).done, "recreated");
     EXPECT_EQ(mgmtd.sent(2), before);

@@ -32,7 +32,7 @@ static const char *const TRIAL_END = "/mgmtctl/this/is/only/a/trial";
 
 const std::vector<group_word> &group_words() {
     static const std::vector<group_word> words = {
-        {"interface", "interface", "NAME, or none: the first of the appliance", true, false},
+        {"interface", "interface", "NAME, or none", true, false},
         {"router", "router", "ADDRESS, once for each router; together they are the new list", true, false},
         {"weight", "weight", nullptr, false, false},
         {"password", "password", "up to 8 characters; \"\" for none", false, true},
@@ -352,6 +352,13 @@ static void settle(const group_link &link, bool wanted, group_result *inout) {
     inout->designated = oper.ends_with(", DESIGNATED");
 }
 
+// What mgmtd takes, and what is of no use all the same.
+static std::string what_it_lacks(const group_nodes &nodes) {
+    if (!nodes.contains("interface"))
+        return "without an interface it takes no part";
+    return routers_of(nodes).empty() ? "without a router it takes no part" : "";
+}
+
 static void group_add(const group_link &link, const std::string &root, const wanted_group &wish,
                       group_result *inout) {
     bool there = false;
@@ -370,6 +377,7 @@ static void group_add(const group_link &link, const std::string &root, const wan
     put_routers(wish.routers.value_or(std::vector<std::string>{}), &nodes);
     if (commit(link, creation(root, nodes), inout)) {
         inout->done = "added";
+        inout->note = what_it_lacks(nodes);
         settle(link, true, inout);
     }
 }
@@ -413,8 +421,10 @@ static void group_set(const group_link &link, const std::string &root, const wan
     }
     if (!as_whole.empty()) {
         recreate(link, root, before, after, inout);
+        const std::string lack = what_it_lacks(after);
         if (inout->done == "recreated")
-            inout->note = "wccpd takes a change of " + as_whole + " only with the group as a whole";
+            inout->note = "wccpd takes a change of " + as_whole + " only with the group as a whole" +
+                          (lack.empty() ? "" : "; " + lack);
     } else if (in_place.empty()) {
         inout->done = "unchanged";
     } else if (commit(link, in_place, inout)) {
