@@ -58,6 +58,7 @@ LAB_TOP=$(dirname "$LAB_HOME")
 LAB_CONFIG=/etc/opt/rvl/mgmtd.conf # inside an appliance
 declare -A LAB_INIT LAB_PID        # first process of an appliance; programs as NODE/NAME
 declare -A LAB_MARKED LAB_FOUND    # lines of the log that don't count; what an appliance held before its programs
+declare -A LAB_KILLED              # sockets that programs had no chance to remove, as an expression
 
 lab_die() { echo "lab: $*" >&2; exit 1; }
 
@@ -230,13 +231,21 @@ lab_alive() { # NODE NAME
 lab_stop() { # NODE NAME [SIGNAL]
     local pid=${LAB_PID[$1/$2]} inner i
     inner=$(lab_pid "$1" "$2")
-    # shellcheck disable=SC2086
-    [ -n "$inner" ] && kill -s "${3-TERM}" $inner
+    if [ -n "$inner" ]; then
+        [ "${3-}" != KILL ] || lab_expect_sockets "$1" "$2" "$inner"
+        kill -s "${3-TERM}" "$inner"
+    fi
     for i in $(seq 300); do
         kill -0 "$pid" 2>/dev/null || { wait "$pid"; return; }
         sleep 0.05
     done
     return 124
+}
+lab_expect_sockets() { # NODE NAME PID
+    local own
+    own=$(awk '/^NSpid:/ { print $NF }' "/proc/$3/status")
+    LAB_KILLED[$1]+="|uds-client-$2-$own\$"
+    [ "$2" != mgmtd ] || LAB_KILLED[$1]+='|uds-provider-mgmtd$'
 }
 # Waits for a program to end without being told to: its status, or 124.
 lab_wait_exit() { # SECONDS NODE NAME
@@ -319,6 +328,8 @@ lab_appliance_start() { # NODE [TEXT]...
 }
 lab_mgmtd_start() { # NODE
     : >"$LAB/$1-mgmtd.out"
+    local killed=${LAB_KILLED[$1]-}
+    LAB_KILLED[$1]=${killed//'|uds-provider-mgmtd$'/}
     lab_start "$1" mgmtd mgmtd --config $LAB_CONFIG
     lab_wait_event 20 "$1" '^mgmtd ready' || lab_show_and_die "$1" "mgmtd of $1 does not start"
 }
@@ -426,7 +437,7 @@ lab_end() { # NODE...
             lab_stop "$node" $name; status=$?
             [ $status = 0 ] || { echo "lab: $name of $node ended with $status" >&2; lab_show "$node"; return 1; }
         done
-        now=$(lab_remains "$node")
+        now=$(lab_remains "$node" | grep -vE "^\$${LAB_KILLED[$node]-}")
         [ "$now" = "${LAB_FOUND[$node]-}" ] ||
             { echo "lab: not the same is left in $node:"; diff <(echo "${LAB_FOUND[$node]-}") <(echo "$now"); return 1; } >&2
     done
@@ -474,7 +485,7 @@ if [ "${BASH_SOURCE[0]}" = "$0" ]; then
     for n in $(seq "$routers"); do lab_router "r$n" "10.0.0.$n"; done
     for n in $(seq "$appliances"); do lab_appliance "a$n" "10.0.0.$((100 + n))"; done
     export LAB WCCP_BIN LAB_HOME LAB_TOP
-    nodes=$(declare -p LAB_INIT LAB_PID LAB_MARKED LAB_FOUND)
+    nodes=$(declare -p LAB_INIT LAB_PID LAB_MARKED LAB_FOUND LAB_KILLED)
     export nodes
     if [ $# -gt 0 ]; then "$@"; exit; fi
     echo "routers: r1..r$routers at 10.0.0.1.. ; appliances: a1..a$appliances at 10.0.0.101.. ; files in $LAB"
