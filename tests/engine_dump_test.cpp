@@ -6,7 +6,9 @@
 
 #include <algorithm>
 #include <cstring>
+#include <fstream>
 #include <functional>
+#include <map>
 #include <memory>
 #include <string>
 
@@ -16,142 +18,21 @@
 
 namespace {
 
-const std::string GLOBAL_TEXT = "\n"
-                                "    WCCP GLOBAL INFO\n"
-                                "\n"
-                                "    WCCP # of groups                 : 1\n"
-                                "    WCCP multicast TTL               : 5\n"
-                                "    WCCP stat num allocs             : 41\n"
-                                "    WCCP stat num frees              : 31\n"
-                                "    WCCP err alloc fails             : 2\n"
-                                "    WCCP # err rx total failures     : 17\n";
-const std::string GROUP_TEXT =
-    "    WCCP appliance ipa               : 10.0.0.1\n"
-    "    WCCP service group (STATE)       : 51 (active)\n"
-    "    WCCP current state up time       : 1:2:3:4\n"
-    "    WCCP protocol                    : 6\n"
-    "    WCCP service flags               : 0x6\n"
-    "    WCCP security option             : 1\n"
-    "    WCCP weight                      : 100\n"
-    "    WCCP priority                    : 240\n"
-    "    WCCP password                    : secret12 0x73, 0x65, 0x63, 0x72, 0x65, 0x74, 0x31, 0x32, \n"
-    "    WCCP admin state                 : enabled\n"
-    "    WCCP configured multicast IP     : 0.0.0.0\n"
-    "    WCCP cfg force L2 return         : 1\n"
-    "    WCCP cfg compatibility mode      : 1 (ios:1 nexus:2)\n"
-    "    WCCP configured interfaces       : 1\n"
-    "    WCCP interfaces                  : # 1 lan0\n"
-    "    WCCP interface ipa and link      : 10.0.0.1 up \n"
-    "    WCCP interface ready flags       : ipa: ok link: no track intf: no \n"
-    "    WCCP configured unicast routers  : # 2\n"
-    "    WCCP configured unicast rtr      : #1 10.0.0.201\n"
-    "    WCCP configured unicast rtr      : #2 10.0.0.202\n"
-    "    WCCP config fwd, assign, return  : gre or L2, hash or mask, gre or L2\n"
-    "    WCCP actual fwd, assign, return  : L2, hash, gre\n"
-    "    WCCP # of view changes           : 7\n"
-    "    WCCP # of transitions (act/ina)  : 3\n"
-    "    WCCP state flags                 : 0x2a = { ACTIVE CAPABILITIES_SET SHUTTING_DOWN  }\n"
-    "    WCCP designated appliance        : yes\n"
-    "    WCCP designated key change #     : 9\n"
-    "    WCCP designated pend. acks       : 1\n"
-    "    WCCP # rtrs redirecting to me    : 4\n"
-    "    WCCP # rmval queries remaining   : 0\n"
-    "    WCCP ICU sending routers         : 1\n"
-    "    ***** WCCP ICU sending router ** : # 1\n"
-    "    WCCP router id (src ip)          : 10.0.0.201 (10.0.0.211)\n"
-    "    WCCP router received id          : 0x12\n"
-    "    WCCP router change number        : 83886080\n"
-    "    WCCP router state flags          : 0x6\n"
-    "    WCCP router connected            : two-way\n"
-    "    WCCP current state up time       : 0:0:1:5\n"
-    "    WCCP router's capabilities       \n"
-    "    WCCP router fwd, assign, return  : L2, INVALID, gre or L2\n"
-    "    WCCP router assignment (RXed)   \n"
-    "    WCCP appliance id                : 10.0.0.1\n"
-    "    WCCP rx buckets assigned/total   : 64/256\n"
-    "    WCCP rx bucket bits 0-127        : 0x04030201 00000000 00000000 00000000\n"
-    "    WCCP rx bucket bits 128-255      : 0x00000000 00000000 00000000 00000080\n"
-    "    WCCP # routers in view           : 1\n"
-    "    WCCP view router id/flags        : 10.0.0.201 0x1\n"
-    "    WCCP # appliances in view        : 1\n"
-    "    WCCP view app.id/weight/flags    : 10.0.0.1 50 0x0\n"
-    "    WCCP ICU sending routers end.\n"
-    "    WCCP # of appliances in view     : 1\n"
-    "    WCCP appliance (sorted w+ip)     : 10.0.0.1 wgt = 100 ref = 2\n"
-    "    WCCP # of routers in view        : 1\n"
-    "    WCCP router view ipa/refcnt      : 10.0.0.201 3\n"
-    "    WCCP raised alarms               : flag: 0x3 adj down, assign tbl mismatch\n"
-    "    WCCP timer router-down alarm     : 12 (seconds)\n"
-    "    WCCP timer assin. mismatch alarm : 0 (seconds)\n";
-const std::string ASSIGNMENT_HEAD = "\n"
-                                    "\tAssignment                \n"
-                                    "\tConfigured HASH            : dst-ip src-port \n"
-                                    "\tConfigured MASK            : src-ip: 0x00001741, src-port: 0x0000 \n"
-                                    "\t                           : dst-ip: 0x00000000, dst-port: 0x0001\n"
-                                    "\tConfigured assign. method  : either\n"
-                                    "\tNegotiated assign. method  : hash\n";
-const std::string HASH_DESIGNATOR = "\n"
-                                    "\tDesignator allocation     \n"
-                                    "\tActive appliances          : 2\n"
-                                    "\tAppliance ip               : 10.0.0.1\n"
-                                    "\tWeight                     : 100\n"
-                                    "\tHash/mask allotment        : 33 % \n"
-                                    "\t                           : 0x00000000 00000000 00000000 00000000\n"
-                                    "\t                           : 0x00000000 001fffff ffffffff ffffffff\n"
-                                    "\n"
-                                    "\tAppliance ip               : 10.0.0.2\n"
-                                    "\tWeight                     : 200\n"
-                                    "\tHash/mask allotment        : 66 % \n"
-                                    "\t                           : 0xffffffff ffffffff ffffffff ffffffff\n"
-                                    "\t                           : 0xffffffff ffe00000 00000000 00000000\n"
-                                    "\n";
-const std::string HASH_ROUTERS = "\tReceived router allocation\n"
-                                 "\tRouter id                  : 10.0.0.201\n"
-                                 "\tAppliance ip               : 10.0.0.1\n"
-                                 "\tWeight                     : 50\n"
-                                 "\tRxed hash bucket allotment : 25 % \n"
-                                 "\tRxed hash assignment       : 0x01020304 00000000 00000000 00000000\n"
-                                 "\t                           : 0x00000000 00000000 00000000 80000000\n"
-                                 "\n"
-                                 "\n";
-const std::string STATS_TEXT = "\n"
-                               "    ********* WCCP GROUP ID 51 STATS ****\n"
-                               "    WCCP # rx icus                   : 1\n"
-                               "    WCCP # rx removal queries        : 2\n"
-                               "    WCCP # tx here_i_am              : 3\n"
-                               "    WCCP # tx redirect assign        : 4\n"
-                               "    WCCP # tx removal query h-i-m    : 5\n"
-                               "    WCCP # alarm router verify sch.  : 6\n"
-                               "    WCCP # alarm assign. verify sch. : 7\n"
-                               "    WCCP # rx unknown capabilities   : 8\n"
-                               "    WCCP # rx err total failures     : 9\n"
-                               "    WCCP # tx err total failures     : 10\n"
-                               "    WCCP # tx err service mismatch   : 11\n"
-                               "    WCCP # rx err authen. mismatch   : 12\n"
-                               "    WCCP # rx err authen. failures   : 13\n";
-const std::string MASK_DESIGNATOR = "\n"
-                                    "\tDesignator allocation     \n"
-                                    "\tActive appliances          : 1\n"
-                                    "\tAppliance ip               : 10.0.0.1\n"
-                                    "\tWeight                     : 100\n"
-                                    "\tHash/mask allotment        : 100 % \n"
-                                    "\n"
-                                    "\tDesignator mask assignment\n"
-                                    "\t      Mask : src-ip     dst-ip     src-port dst-port\n"
-                                    "\t         0 : 0x00000001 0x00001700 0x0000   0x0080\n"
-                                    "\n"
-                                    "\t     Value : src-ip     dst-ip     src-port dst-port appliance ip\n"
-                                    "\t         0 : 0x00000000 0x00000000 0x0000   0x0000   10.0.0.1\n"
-                                    "\t         1 : 0x00000001 0x00001000 0x0002   0x0080   10.0.0.1\n"
-                                    "\n";
-const std::string MASK_ROUTERS = "\tReceived router allocation\n"
-                                 "\tRouter id                  : 10.0.0.201\n"
-                                 "\tAppliance ip               : 10.0.0.1\n"
-                                 "\tWeight                     : 50\n"
-                                 "\tRxed mask value allotment  : 25 % \n"
-                                 "\tRxed value buckets (0-127) : 0x01020304 00000000 00000000 00000000\n"
-                                 "\n"
-                                 "\n";
+// The texts as an operator has them, each behind a line with its name.
+const std::map<std::string, std::string> golden = [] {
+    std::ifstream file(WCCP_SOURCE_DIR "/tests/golden/engine_dumps.txt");
+    std::map<std::string, std::string> found;
+    for (std::string line, name; std::getline(file, line);)
+        if (line.starts_with("== "))
+            name = line.substr(3);
+        else
+            found[name] += line + "\n";
+    return found;
+}();
+const std::string GLOBAL_TEXT = golden.at("global"), GROUP_TEXT = golden.at("group"),
+                  STATS_TEXT = golden.at("statistics"), ASSIGNMENT_HEAD = golden.at("assignment"),
+                  HASH_TEXT = ASSIGNMENT_HEAD + golden.at("hash designator") + golden.at("hash routers"),
+                  MASK_TEXT = golden.at("mask designator"), MASK_ROUTERS = golden.at("mask routers");
 
 struct dump {
     int result;
@@ -261,8 +142,6 @@ struct EngineDump : testing::Test, reported_group {
     wccp_sending_router *first;
 };
 
-const std::string HASH_TEXT = ASSIGNMENT_HEAD + HASH_DESIGNATOR + HASH_ROUTERS;
-
 TEST_F(EngineDump, TheWholeTexts) {
     const std::string begin = "\n*******   WCCP GROUP 51 INFO START **********\n",
                       middle = "    ******* WCCP GROUP 51 ASSIGNMENT INFO ******\n",
@@ -321,7 +200,7 @@ TEST_F(EngineDump, WhatTheDesignatorComputed) {
     std::string head = ASSIGNMENT_HEAD;
     head.replace(head.find("either"), 6, "unknown");
     head.replace(head.rfind("hash"), 4, "mask");
-    EXPECT_EQ(text(), head + MASK_DESIGNATOR + MASK_ROUTERS);
+    EXPECT_EQ(text(), head + MASK_TEXT + MASK_ROUTERS);
 
     // Another's computation isn't shown, what the routers report still is; no buckets make no share.
     group->designated = 0;
