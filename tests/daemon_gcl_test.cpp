@@ -143,8 +143,8 @@ TEST_F(Gcl, ThePeersIdsAreChecked) {
     } cases[] = {
         {none, none, 2, true, "client open for peer mgmtd-1"},
         {geteuid(), getegid(), 2, true, "client open for peer mgmtd-1"},
-        {none, getegid(), 2, false, "proto admin: bad uid / gid in greeting: -1/0"},
-        {geteuid(), none, 2, false, "proto admin: bad uid / gid in greeting: 0/-1"},
+        {none, getegid(), 2, false, "proto admin: bad uid / gid in greeting: -1/0\n"},
+        {geteuid(), none, 2, false, "proto admin: bad uid / gid in greeting: 0/-1\n"},
         {geteuid() + 7, getegid(), 2, false, "proto admin: bad uid / gid in greeting: 7/0 not 0/0"},
         {none, none, 3, false, "proto admin: bad version in greeting: 3 not 2"},
     };
