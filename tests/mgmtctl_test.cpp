@@ -257,6 +257,7 @@ TEST(Names, AMistypedOneGetsAHint) {
     } cases[] = {
         {"qv/wccpd", "a name begins with \"/\""},
         {"/qv//wccpd", "a name has no empty part"},
+        {"/", "\"mgmtctl walk /\" lists what there is"},
         {"/qv", "it has no value of its own; \"mgmtctl walk /qv\" lists what is below"},
         {"/qv/wcpd/system", "did you mean /qv/wccpd?"},
         {G51 + "/wieght", "did you mean " + G51 + "/weight?"},

@@ -106,8 +106,10 @@ static int walk(const ctl_options &options, const std::string &name, ctl_walk ho
         found.insert(found.end(), reply.bindings.begin(), reply.bindings.end());
     }
     if (found.empty())
-        return tell_failure(options, {CTL_NOT_FOUND, name, "there is nothing below",
-                                      hint_for_missing(mgmtd.asking(), name), LC_NOT_FOUND});
+        return tell_failure(
+            options, {CTL_NOT_FOUND, name,
+                      how == ctl_walk::children ? "no node is directly below" : "there is nothing below",
+                      hint_for_missing(mgmtd.asking(), name), LC_NOT_FOUND});
     ctl_json nodes = ctl_json::array();
     for (const ctl_binding &binding : found) {
         if (options.json)

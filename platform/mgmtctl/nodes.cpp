@@ -123,6 +123,8 @@ static const std::string *nearest(const std::string &wanted, const std::vector<s
 }
 
 std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
+    if (text == "/")
+        return "\"mgmtctl walk /\" lists what there is";
     node_name name;
     if (!parse_node_name(text, &name))
         return text.starts_with('/') ? "a name has no empty part" : "a name begins with \"/\"";

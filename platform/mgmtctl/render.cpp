@@ -9,12 +9,24 @@
 #include <algorithm>
 #include <cstdio>
 
+#include <unistd.h>
+
 #include "platform/binding_text.h"
 #include "platform/schema.h"
 #include "runtime/common.h"
 
+// Values come from others: on a terminal they write, and do nothing else.
+static std::string harmless(std::string text) {
+    for (char &c : text)
+        if ((static_cast<unsigned char>(c) < 0x20 && c != '\n' && c != '\t') || c == 0x7f)
+            c = '?';
+    return text;
+}
+
 void put(const std::string &text) {
-    (void)fwrite(text.data(), 1, text.size(), stdout);
+    static const bool terminal = isatty(STDOUT_FILENO);
+    const std::string &shown = terminal ? harmless(text) : text;
+    (void)fwrite(shown.data(), 1, shown.size(), stdout);
 }
 
 std::string json_line(const ctl_json &value) {

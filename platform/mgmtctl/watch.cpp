@@ -238,6 +238,9 @@ static int follow(const ctl_options &options, ctl_session *session, const std::v
 
 int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count) {
     std::string reason;
+    for (const std::string &name : names)
+        if (node_name parsed; !parse_node_name(watch_pattern(name), &parsed))
+            return tell_failure(options, {CTL_USAGE, name, "is no name of a node", "", 0});
     ctl_session *session = ctl_open(options.timeout_ms, &reason);
     if (!session)
         return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});
