@@ -35,12 +35,7 @@ struct Loop : testing::Test {
     std::string dispatched(lc_status (*dispatch)(lew *, int *, int *)) const {
         int none = 5, escaped = 5;
         const lc_status status = dispatch(wrapper, &none, &escaped);
-        if (status != LC_OK)
-            return std::to_string(status);
-        return none == 1 && escaped == 0   ? "no events"
-               : none == 0 && escaped == 1 ? "escaped"
-               : none == 0 && escaped == 0 ? "ran"
-                                           : "nonsense";
+        return status != LC_OK ? std::to_string(status) : none ? "no events" : escaped ? "escaped" : "ran";
     }
     std::string once() const { return dispatched(lew_dispatch_once); }
     std::string whole() const { return dispatched(lew_dispatch); }
