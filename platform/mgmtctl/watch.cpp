@@ -220,8 +220,7 @@ static int follow(const ctl_options &options, ctl_session *session, const std::v
         if (event != CHANGE_EVENT && !names.empty())
             break;
         if (!ctl_add_interest(session, event, patterns, &reason))
-            return tell_failure(
-                options, {reason.starts_with("No pattern") ? CTL_USAGE : CTL_UNREACHABLE, "", reason, "", 0});
+            return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});
     }
     for (uint64_t seen = 0; (count == 0 || seen < count) && !ctl_stop_signal && anybody_reads();) {
         ctl_event event;
