@@ -4,7 +4,6 @@
 #include "engine/wccp_config.h"
 
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <cstring>
 #include <string>
