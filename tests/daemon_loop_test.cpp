@@ -197,6 +197,28 @@ TEST_F(Loop, AnEventTakenAwayByAnEarlierCallbackNeverRuns) {
     }
 }
 
+TEST_F(Loop, PostedWorkComesBeforeTheNextCallback) {
+    struct record {
+        loop_post post;
+        int carried;
+    } work = {};
+    work.post.function = [](loop_post *post, int carry_out) {
+        reinterpret_cast<record *>(post)->carried += carry_out;
+    };
+    readable pair[2];
+    for (readable &each : pair) {
+        each.action = [&] {
+            if (pair[0].runs + pair[1].runs == 1)
+                std::thread([&] { loop_post_work(loop, &work.post); }).join();
+            else
+                EXPECT_EQ(work.carried, 1);
+        };
+        each.start(loop);
+    }
+    while (pair[0].runs + pair[1].runs < 2)
+        ASSERT_EQ(once(), "ran");
+}
+
 // ---- Signals
 
 struct Signals : Loop {
