@@ -21,7 +21,6 @@
 #include "engine/wccp_host.h"
 #include "engine/wccp_link_mgr.h"
 #include "engine/wccp_network.h"
-#include "engine/wccp_tunnel.h"
 #include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"
 #include "runtime/common.h"
@@ -172,29 +171,6 @@ TEST_F(Threads, BridgeModeUnderAFlood) {
     over = true;
     flood.join();
 }
-
-#ifndef __SANITIZE_THREAD__ // which loses count of the locks when a wait inside it is unwound
-// A receive thread that waits for an absent tunneld has the engine lock and the mailbox's. Cancelled where it
-// stands, it ends at once and takes nothing along.
-TEST_F(Threads, CancelledWhileItWaitsForTunneld) {
-    add_group(61, "wan0");
-    tunneld->take_commands();
-    tunneld->answer_with(tunneld_is_silent);
-    see_you(first, 61, "10.1.0.2", "10.1.0.1");
-    tunneld->wait_for_command();
-    EXPECT_FALSE(lock_is_free());
-    const auto before = steady::now();
-    cthread_cancel_all();
-    EXPECT_LT(steady::now() - before, 1s);
-    EXPECT_TRUE(lock_is_free());
-    EXPECT_EQ(wccp_mailbox->command.load(), MAILBOX_IDLE) << "the add is withdrawn";
-    EXPECT_EQ(router_count(61), 0u);
-    tunneld->answer_with(tunneld_does);
-    EXPECT_EQ(wccp_add_tunnel(61, ipa("10.1.0.1"), ipa("10.1.0.9")), 0)
-        << "tunnel mutex and mailbox are free";
-    wccp_del_group(61);
-}
-#endif
 
 // The whole exit, with the reset of the mailbox and without: the groups wait for the lock, but in bounded
 // time.
