@@ -1,0 +1,85 @@
+// wccpd with a stopwatch on its engine lock: for each second of the clock one line on standard output, with
+// how often the lock was held, for how long at the mean and at most, and for how much processor time at most.
+// What a hold takes beyond its processor time it waited for: for the processor, or for somebody else.
+//
+// The program's own pthread_mutex_lock and pthread_mutex_unlock stand in front of those of the C library. The
+// figures are guarded by the lock that they are about.
+#include <cstdint>
+#include <cstdio>
+#include <ctime>
+
+#include <dlfcn.h>
+#include <pthread.h>
+
+#include "daemon/wccpd_main.h"
+#include "engine/wccp_mgr.h"
+#include "runtime/guards.h"
+
+namespace {
+
+struct hold {
+    int64_t wall, cpu; // nanoseconds
+};
+hold now() {
+    const auto of = [](clockid_t clock) {
+        timespec time = {};
+        clock_gettime(clock, &time);
+        return time.tv_sec * int64_t{1'000'000'000} + time.tv_nsec;
+    };
+    return {of(CLOCK_REALTIME), of(CLOCK_THREAD_CPUTIME_ID)};
+}
+
+struct second {
+    int64_t number, holds, wall, wall_max, cpu_max;
+};
+hold taken;
+second current;
+
+// The second that is over, when this hold is the first of the next one; else one without holds.
+second count(const hold &given) {
+    second over = {};
+    const int64_t wall = given.wall - taken.wall, cpu = given.cpu - taken.cpu;
+    if (current.number != given.wall / 1'000'000'000) {
+        over = current;
+        current = {given.wall / 1'000'000'000, 0, 0, 0, 0};
+    }
+    current.holds++;
+    current.wall += wall;
+    current.wall_max = wall > current.wall_max ? wall : current.wall_max;
+    current.cpu_max = cpu > current.cpu_max ? cpu : current.cpu_max;
+    return over;
+}
+
+using mutex_function = int (*)(pthread_mutex_t *);
+mutex_function behind(const char *name) {
+    return reinterpret_cast<mutex_function>(dlsym(RTLD_NEXT, name));
+}
+
+} // namespace
+
+extern "C" int pthread_mutex_lock(pthread_mutex_t *mutex) noexcept {
+    static const mutex_function real = behind("pthread_mutex_lock");
+    const int result = real(mutex);
+    if (mutex == &wccp_g.lock)
+        taken = now();
+    return result;
+}
+
+extern "C" int pthread_mutex_unlock(pthread_mutex_t *mutex) noexcept {
+    static const mutex_function real = behind("pthread_mutex_unlock");
+    second over = {};
+    if (mutex == &wccp_g.lock)
+        over = count(now());
+    const int result = real(mutex);
+    if (over.holds) {
+        const cancel_off_guard uncancelled;
+        dprintf(1, "%lld holds %lld mean %lld max %lld cpu %lld us\n", static_cast<long long>(over.number),
+                static_cast<long long>(over.holds), static_cast<long long>(over.wall / over.holds / 1000),
+                static_cast<long long>(over.wall_max / 1000), static_cast<long long>(over.cpu_max / 1000));
+    }
+    return result;
+}
+
+int main() {
+    return wccpd_main();
+}

@@ -1,0 +1,86 @@
+#!/bin/bash
+# mgmtd is stopped (SIGSTOP), not gone, while a router flaps for 200 groups: alarms and changes of role fill the
+# socket and then the queue, which tells it once; the steady router goes on hearing Here-I-Am every 10 seconds and
+# is answered; SIGTERM ends the daemon in order within 3 seconds, and mgmtd goes on when it is let.
+#   scenario_alarm_stop.sh DIRECTORY_OF_THE_PROGRAMS [SECONDS]
+# With SECONDS of the wall it runs bench/wccpd_timed, half of that time with mgmtd running and half with it stopped, and
+# prints what the engine's lock was held for, in the place of filling the queue.
+set -u
+: "${LAB_SPEED:=30}"
+export LAB_SPEED LAB_LOG_LEVEL=notice
+top=$(cd "$(dirname "$0")/.." && pwd)
+export WCCP_BIN=${1:-$top/build/release/bin}
+# shellcheck source=../lab/topology.sh
+source "$top/lab/topology.sh"
+lab_enter "$0" "$@"
+measured=${2-}
+
+fail() { echo "$*" >&2; tail -n 15 "$LAB"/a1.log "$LAB"/a1-*.out >&2; exit 1; }
+heard() { jq -c 'select(.what == "here-i-am" and .service == 255) | .t' "$LAB/r2.log"; }
+# One time down and up again: a router is given up after 30 seconds, the table comes back in less than 30.
+flap() {
+    lab_ctl r1 stop >/dev/null; lab_sleep 33
+    lab_ctl r1 resume >/dev/null; lab_sleep 35
+}
+
+lab_router r1 10.0.0.1
+lab_router r2 10.0.0.2
+lab_appliance a1 10.0.0.101
+groups=("$(lab_group 255 10.0.0.2)")
+for id in $(seq 51 250); do groups+=("$(lab_group $id 10.0.0.1 priority=$id)"); done
+lab_write_config a1 "${groups[@]}"
+lab_mgmtd_start a1
+lab_start a1 tunneld tunneld
+lab_start a1 wccpd "wccpd${measured:+_timed}"
+lab_wait_role 30 a1 255 ACTIVE && lab_wait_role 30 a1 250 ACTIVE || fail "the groups don't become active"
+
+mgmtd=$(lab_pid a1 mgmtd)
+if [ -n "$measured" ]; then
+    for state in CONT STOP; do
+        # shellcheck disable=SC2086
+        kill -$state $mgmtd
+        lines=$(wc -l <"$LAB/a1-wccpd.out") began=$SECONDS
+        while [ $((SECONDS - began)) -lt $((measured / 2)) ]; do flap; done
+        tail -n +$((lines + 2)) "$LAB/a1-wccpd.out" >"$LAB/$state"
+    done
+    for state in CONT STOP; do
+        awk -v state=$state '/ holds / { holds += $3; all += $3 * $5; max = $7 > max ? $7 : max; cpu = $9 > cpu ? $9 : cpu }
+            END { printf "%s %d %.1f %d %d\n", state, holds, all / holds, max, cpu }' "$LAB/$state"
+    done | awk '
+        { holds[$1] = $2; mean[$1] = $3; max[$1] = $4; cpu[$1] = $5 }
+        END {
+            printf "%-16s %10s %10s %10s %14s\n", "engine lock", "holds", "mean, us", "max, us", "max cpu, us"
+            form = "%-16s %10d %10.1f %10d %14d\n"
+            printf form, "mgmtd runs", holds["CONT"], mean["CONT"], max["CONT"], cpu["CONT"]
+            printf form, "mgmtd stopped", holds["STOP"], mean["STOP"], max["STOP"], cpu["STOP"]
+            printf "%-16s %10s %10.2f %10.2f %14.2f\n", "ratio", "", mean["STOP"] / mean["CONT"], max["STOP"] / max["CONT"], cpu["STOP"] / cpu["CONT"]
+        }'
+else
+    # shellcheck disable=SC2086
+    kill -STOP $mgmtd
+    for _ in $(seq 40); do
+        flap
+        grep -q 'output queue full' "$LAB/a1.log" && break
+    done
+    flap
+    [ "$(grep -c 'output queue full with [0-9]* bytes, peer [^ ]* does not read; frames are lost' "$LAB/a1.log")" = 1 ] ||
+        fail "a full queue is told once"
+    # A busy machine may hold it up for a moment; a daemon that waits for mgmtd says nothing any more.
+    heard | jq -es '[.[1:], .[:-1]] | transpose | map(.[0] - .[1]) | length > 50 and max < 60 and
+        (sort | .[length / 10 | floor] > 9 and .[length * 9 / 10 | floor] < 11.5)' >/dev/null ||
+        fail "Here-I-Am does not come every 10 seconds: $(heard | tr '\n' ' ')"
+    lab_wait 5 '.groups["255"] | .assignment.kind != "none" and .appliances[0].address == "10.0.0.101"' lab_ctl r2 show ||
+        fail "the steady router has lost the appliance"
+fi
+
+began=${EPOCHREALTIME/./}
+# shellcheck disable=SC2046
+kill -TERM $(lab_pid a1 wccpd)
+lab_wait_exit 3 a1 wccpd || fail "after SIGTERM the daemon ended with $?"
+[ $((${EPOCHREALTIME/./} - began)) -lt 3000000 ] || fail "the end takes too long"
+[[ $(tail -n 3 "$LAB/a1.log") = *"WCCP: wccp manager is exiting"*"WCCP daemon exiting with code 0"* ]] || fail "no end in order"
+# shellcheck disable=SC2086
+kill -CONT $mgmtd "${LAB_PID[a1/mgmtd]}"
+lab_wait_event 10 a1 '^session of wccpd-[0-9]* closed' || fail "mgmtd does not go on"
+lab_stop a1 mgmtd || fail "mgmtd ended with $?"
+exit 0
