@@ -216,8 +216,10 @@ static lc_status get_binding(wire_reader *reader, bn_binding **out) {
     owned_binding binding;
     CHECK_STATUS(bn_binding_new_parts_components_takeover(&binding.pointer, &name, &parts.pointer,
                                                           absolute ? 1 : 0, nullptr));
-    // The name has them all, and they take more memory than everything else of a binding.
+    // The name has them all, and they take more memory than everything else of a binding. What begins with an
+    // empty part reads as an absolute name from here on.
     CHECK_STATUS(bn_binding_drop_name_parts(binding.pointer));
+    binding.pointer->absolute = bn_binding_get_name_quick(binding.pointer)[0] == '/';
     uint32_t count = 0;
     CHECK_STATUS(get_u32(reader, &count));
     for (uint32_t i = 0; i < count; i++)
