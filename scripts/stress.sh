@@ -1,28 +1,46 @@
 #!/bin/bash
 # stress.sh [NAME...]: the tests with threads in their long form (a minute of sending, a thousand closings and so on),
-# each under the address and under the thread sanitizer, all of them or those named. What fails keeps its log in
-# build/stress/; ends with 1 when one did.
+# each under the address and under the thread sanitizer, then the whole appliance with mgmtd killed at a hundred random
+# moments, under the address sanitizer: all of them or those named. What fails keeps its log in build/stress/; ends
+# with 1 when one did.
 set -u
 cd "$(dirname "$0")/.." || exit 1
 mkdir -p build/stress
 names=("$@")
-[ $# -gt 0 ] || for source in tests/*_mt_test.cpp; do names+=("$(basename "$source" .cpp)"); done
+[ $# -gt 0 ] || for source in tests/*_mt_test.cpp tests/scenario_daemon.sh; do
+    source=${source##*/}; names+=("${source%.*}")
+done
 status=0
+
+run() { # NAME PRESET COMMAND...
+    local name=$1 preset=$2 start=$SECONDS
+    local log=build/stress/$name.$preset.log; shift 2
+    if WCCP_STRESS=1 TSAN_OPTIONS="detect_deadlocks=1 second_deadlock_stack=1" timeout 900 "$@" >"$log" 2>&1; then
+        echo "$name ($preset): passed in $((SECONDS - start)) s"
+    else
+        status=1
+        echo "$name ($preset): FAILED, see $log"
+        tail -n 20 "$log"
+    fi
+}
+
 for preset in asan tsan; do
-    { cmake --preset $preset && cmake --build --preset $preset -j "$(nproc)" --target "${names[@]}"; } \
+    targets=() scenarios=()
+    for name in "${names[@]}"; do
+        case $name in
+        scenario_*) [ $preset = tsan ] || scenarios+=("$name") ;;
+        *) targets+=("$name") ;;
+        esac
+    done
+    [ ${#scenarios[@]} = 0 ] || targets+=(wccpd mgmtd mgmtctl tunneld wccp_router fast_clock)
+    [ ${#targets[@]} -gt 0 ] || continue
+    { cmake --preset $preset && cmake --build --preset $preset -j "$(nproc)" --target "${targets[@]}"; } \
         >build/stress/$preset.log 2>&1 || { tail -n 40 build/stress/$preset.log; exit 1; }
     # The thread sanitizer wants its usual places in memory.
-    run=(); [ $preset = asan ] || run=(setarch -R)
-    for name in "${names[@]}"; do
-        log=build/stress/$name.$preset.log start=$SECONDS
-        if WCCP_STRESS=1 TSAN_OPTIONS="detect_deadlocks=1 second_deadlock_stack=1" \
-            timeout 900 "${run[@]}" lab/in-appliance "build/$preset/bin/$name" >"$log" 2>&1; then
-            echo "$name ($preset): passed in $((SECONDS - start)) s"
-        else
-            status=1
-            echo "$name ($preset): FAILED, see $log"
-            tail -n 20 "$log"
-        fi
+    with=(); [ $preset = asan ] || with=(setarch -R)
+    for name in "${targets[@]}"; do
+        [[ $name != *_test ]] || run "$name" $preset "${with[@]}" lab/in-appliance "build/$preset/bin/$name"
     done
+    for name in "${scenarios[@]}"; do run "$name" $preset "tests/$name.sh" "$PWD/build/$preset/bin"; done
 done
 exit $status

@@ -37,6 +37,9 @@ for _ in $(seq 40); do [ -s "$pid_file" ] && break; sleep 0.05; done
 lab_wait_role 45 a1 51 ACTIVE || fail "the group does not become active"
 lab_wait 5 '.groups["51"].assignment.kind as $kind | $kind == "hash" or $kind == "mask"' lab_ctl r1 show ||
     fail "the router has no table"
+# Every mapped page is locked, read or not: arenas of threads and stacks of the usual size would show here.
+locked=$(awk '$1 == "VmLck:" { print $2 }' "/proc/$(lab_pid a1 wccpd | tr -d ' ')/status")
+[ "$locked" -le 7168 ] || ldd "$WCCP_BIN/wccpd" | grep -q 'lib[at]san' || fail "$locked kB are locked"
 
 lab_configure a1 "$(lab_group 51 10.0.0.1 weight=7)" || fail "the weight is refused"
 lab_wait 15 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight does not arrive"
