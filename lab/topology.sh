@@ -195,8 +195,12 @@ lab_in() { # NAME COMMAND...
 
 # What a program is started with to run by the clock of the protocol: LAB_CLOCK.
 lab_clock() {
+    local library
     LAB_CLOCK=()
-    [ "$LAB_SPEED" = 1 ] || LAB_CLOCK=(env "LD_PRELOAD=$(dirname "$WCCP_BIN")/lib/libfast_clock.so" "FAST_CLOCK=$LAB_SPEED"
+    [ "$LAB_SPEED" != 1 ] || return 0
+    library=$(dirname "$WCCP_BIN")/lib/libfast_clock.so
+    [ -e "$library" ] || lab_die "no $library"
+    LAB_CLOCK=(env "LD_PRELOAD=$library" "FAST_CLOCK=$LAB_SPEED"
         "ASAN_OPTIONS=${ASAN_OPTIONS:+$ASAN_OPTIONS:}verify_asan_link_order=0")
 }
 lab_sleep() { # SECONDS of the protocol
