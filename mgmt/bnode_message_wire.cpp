@@ -4,6 +4,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "mgmt/bnode_names.h"
 #include "mgmt/bnode_proto.h"
 #include "mgmt/bnode_proto_arrays.h"
 #include "mgmt/bnode_types.h"
@@ -79,17 +80,45 @@ static uint32_t used(const tbuffer *buffer) {
     return static_cast<uint32_t>(tb_length(buffer));
 }
 
+// A part of a name, without its escapes.
+static lc_status put_escaped_part(tbuffer *buffer, const char *part, const char *end) {
+    const uint32_t length_at = used(buffer);
+    CHECK_STATUS(put_u32(buffer, 0));
+    const char *run = part;
+    for (; part < end; part++)
+        if (bn_escapes(part)) {
+            CHECK_STATUS(tb_append_buf(buffer, run, static_cast<uint32_t>(part - run)));
+            run = ++part; // begins with the character that was escaped
+        }
+    CHECK_STATUS(tb_append_buf(buffer, run, static_cast<uint32_t>(end - run)));
+    CHECK_STATUS(put_u32_at(buffer, length_at, used(buffer) - length_at - 4));
+    return LC_OK;
+}
+// Every message writes a name for each of its bindings, so the parts are taken out of the text in place.
+static lc_status put_name_text(tbuffer *buffer, const char *name) {
+    const bool absolute = *name == '/';
+    CHECK_STATUS(tb_append_uint8(buffer, absolute));
+    const uint32_t count_at = used(buffer);
+    CHECK_STATUS(put_u32(buffer, 0));
+    const char *part = name + absolute;
+    uint32_t count = 0;
+    for (const char *end = part; *part || count; part = end + 1) {
+        end = bn_part_end(part);
+        CHECK_STATUS(put_escaped_part(buffer, part, end));
+        count++;
+        if (!*end)
+            break;
+    }
+    CHECK_STATUS(put_u32_at(buffer, count_at, count));
+    return LC_OK;
+}
 static lc_status put_name(tbuffer *buffer, const bn_binding *binding) {
     const tstr_array *parts = nullptr;
     int absolute = 0;
-    owned_tstr_array split;
     CHECK_STATUS(bn_binding_get_name_parts_const(binding, &parts, &absolute));
-    if (!parts) {
-        CHECK_STATUS(bn_binding_name_to_parts(bn_binding_get_name_quick(binding), &split.pointer, &absolute));
-        parts = split.pointer;
-    }
-    const uint8_t absolute_byte = absolute ? 1 : 0;
-    CHECK_STATUS(tb_append_uint8(buffer, absolute_byte));
+    if (!parts)
+        return put_name_text(buffer, bn_binding_get_name_quick(binding));
+    CHECK_STATUS(tb_append_uint8(buffer, absolute != 0));
     const uint32_t count = tstr_array_length_quick(parts);
     CHECK_STATUS(put_u32(buffer, count));
     for (uint32_t i = 0; i < count; i++)

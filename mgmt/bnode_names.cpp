@@ -44,18 +44,15 @@ bn_pattern::~bn_pattern() {
     (void)tstr_array_free(&parts);
 }
 
-// The end of the part that begins at `name`.
-static const char *part_end(const char *name) {
-    for (; *name && *name != SEPARATOR; name++)
-        if (name[0] == ESCAPE && (name[1] == ESCAPE || name[1] == SEPARATOR))
-            name++;
-    return name;
+const char *bn_part_end(const char *part) {
+    for (; *part && *part != SEPARATOR; part++)
+        part += bn_escapes(part);
+    return part;
 }
 static bool part_equals(const char *name, const char *end, const tstring *part) {
     const char *wanted = part->buffer;
     for (; name < end; name++, wanted++) {
-        if (name[0] == ESCAPE && (name[1] == ESCAPE || name[1] == SEPARATOR))
-            name++;
+        name += bn_escapes(name);
         if (*name != *wanted)
             return false;
     }
@@ -66,7 +63,7 @@ static bool is_text(const tstring *part, const char *text) {
 }
 static uint32_t parts_from(const char *name) {
     uint32_t count = 1;
-    for (name = part_end(name); *name; name = part_end(name + 1))
+    for (name = bn_part_end(name); *name; name = bn_part_end(name + 1))
         count++;
     return count;
 }
@@ -80,7 +77,7 @@ bool bn_pattern_matches(const bn_pattern *pattern, const char *name) {
         return !*name && !wanted_count;
     for (uint32_t i = 0; i < wanted_count; i++) {
         const tstring *wanted = tstr_array_get_quick(pattern->parts, i);
-        const char *end = part_end(name);
+        const char *end = bn_part_end(name);
         if (!part_equals(name, end, wanted) && !is_text(wanted, "*"))
             return is_text(wanted, "**") && wanted_count - i <= parts_from(name);
         if (!*end)

@@ -17,4 +17,11 @@ bool bn_pattern_matches(const bn_pattern *pattern, const char *name);
 // What every matching name begins with. False without memory.
 bool bn_pattern_literal_start(const bn_pattern *pattern, tstring **out);
 
+// The end of the part that begins at `part`: a separator or the end of the name.
+const char *bn_part_end(const char *part);
+// Whether a backslash here escapes the character behind it.
+inline bool bn_escapes(const char *at) {
+    return at[0] == '\\' && (at[1] == '\\' || at[1] == '/');
+}
+
 extern std::atomic<uint32_t> bn_binding_renames;

@@ -4,7 +4,7 @@
 #include <string>
 #include <vector>
 
-#include "mgmt/bnode.h"
+#include "mgmt/bnode_proto.h"
 #include "tests/support/log_lines.cpp" // this program is linked without the engine's helpers
 #include "tests/support/owners.h"
 
@@ -463,7 +463,8 @@ TEST(Bindings, Patterns) {
     for (const auto &c : pattern_cases)
         EXPECT_EQ(bn_binding_name_pattern_match(c.name, c.pattern), c.matched) << c.pattern << " " << c.name;
 }
-// Every short pattern against every short name: the walk over the text and the one over parts agree.
+// Every short pattern against every short name: the walk over the text and the one over parts agree, and so
+// do a message's bytes of a name from either.
 TEST(Bindings, BothMatchersAgreeEverywhere) {
     static const char *pieces[] = {"a", "*", "**", "\\/", "\\\\", "", "ab"};
     std::vector<std::string> names = {"", "/"};
@@ -478,6 +479,21 @@ TEST(Bindings, BothMatchersAgreeEverywhere) {
         parts_owner parts;
         int absolute = 0;
         ASSERT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, &absolute), LC_OK);
+        std::string bytes[2];
+        for (const bool from_parts : {false, true}) {
+            owner<bn_request_msg, bn_request_msg_free> msg;
+            binding_owner binding;
+            buffer_owner buffer;
+            ASSERT_EQ(bn_event_request_msg_create(&msg, "e"), LC_OK);
+            ASSERT_EQ(bn_binding_new_named(&binding, name.c_str()), LC_OK);
+            if (from_parts) {
+                ASSERT_EQ(tstr_array_duplicate(parts, &binding->parts), LC_OK);
+            }
+            ASSERT_EQ(bn_event_request_msg_append_binding_takeover(msg, 0, &binding.pointer, nullptr), LC_OK);
+            ASSERT_EQ(bn_request_msg_serialize(msg, 0, &buffer), LC_OK);
+            bytes[from_parts] = content(buffer);
+        }
+        EXPECT_EQ(bytes[0], bytes[1]) << name;
         for (const std::string &pattern : names)
             ASSERT_EQ(bn_binding_name_pattern_match(name.c_str(), pattern.c_str()),
                       bn_binding_name_parts_pattern_match(parts, absolute, pattern.c_str()))
