@@ -359,6 +359,9 @@ TEST(client, log_levels_at_start) {
     server odd;
     add(odd.held, "/logging/syslog/process/wccpd/log_level", "loud");
     EXPECT_EQ(qv_init_log_level(odd.client), LC_BAD_TYPE);
+    EXPECT_EQ(lc_log_get_facility(odd.client, "wccpd"), 136); // no such node
+    add(odd.held, "/logging/syslog/facility/system", "160", 0, bn_type_uint32);
+    EXPECT_EQ(lc_log_get_facility(odd.client, "wccpd"), 160);
 }
 
 TEST(client, log_levels_on_change) {
