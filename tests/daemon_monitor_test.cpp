@@ -16,46 +16,37 @@ be32 address(uint32_t last_octet) {
     return to_be32(0x0a000000 | last_octet);
 }
 
-struct answer {
-    lc_status status;
-    uint32_t count, type;
-    std::string text;
-    bool operator==(const answer &) const = default;
-};
-void PrintTo(const answer &a, std::ostream *out) {
-    *out << "status " << a.status << ", " << a.count << " of type " << a.type << ": " << a.text;
+// Type and text of the one binding that answers, or what came in its place.
+std::string one(uint32_t type, const std::string &text) {
+    return "type " + std::to_string(type) + ": " + text;
 }
-const answer NOTHING = {LC_OK, 0, 0, ""};
+const std::string NOTHING = "nothing";
 
-answer get(const std::string &name) {
+std::string get(const std::string &name) {
     owner<tstr_array, tstr_array_free> parts;
     EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
     binding_list out;
-    answer got = {wccpd_mon_handle_get(name.c_str(), parts, nullptr, out.array),
-                  bn_binding_array_length_quick(out.array), 0, ""};
-    if (got.count == 0)
-        return got;
+    const lc_status status = wccpd_mon_handle_get(name.c_str(), parts, nullptr, out.array);
+    const uint32_t count = bn_binding_array_length_quick(out.array);
+    if (status != LC_OK || count != 1)
+        return status ? "status " + std::to_string(status) : count ? "too much" : NOTHING;
+    uint32_t type = 0;
     EXPECT_EQ(bn_binding_get_name_quick(out.last()), name);
-    EXPECT_EQ(bn_binding_get_type(out.last(), bn_attrib_value, &got.type, nullptr), LC_OK);
-    got.text = text_of(
-        [&](char **text) { return bn_binding_get_str(out.last(), bn_attrib_value, 0, nullptr, text); });
-    return got;
+    EXPECT_EQ(bn_binding_get_type(out.last(), bn_attrib_value, &type, nullptr), LC_OK);
+    return one(type, text_of([&](char **text) {
+                   return bn_binding_get_str(out.last(), bn_attrib_value, 0, nullptr, text);
+               }));
 }
-answer one(uint32_t type, const std::string &text) {
-    return {LC_OK, 1, type, text};
-}
-
-std::vector<std::string> children(const std::string &name) {
+std::string children(const std::string &name) {
     owner<tstr_array, tstr_array_free> parts, names;
     EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
     EXPECT_EQ(tstr_array_new(&names, nullptr), LC_OK);
     EXPECT_EQ(wccpd_mon_handle_iterate(name.c_str(), parts, nullptr, names), LC_OK);
-    std::vector<std::string> list;
+    std::string list;
     for (uint32_t i = 0; i < tstr_array_length_quick(names); i++)
-        list.push_back(tstr_array_get_str_quick(names, i));
+        list += std::string(tstr_array_get_str_quick(names, i)) + " ";
     return list;
 }
-using names = std::vector<std::string>;
 
 struct DaemonMonitor : testing::Test {
     daemon_engine engine;
@@ -86,7 +77,7 @@ struct DaemonMonitor : testing::Test {
         list_push_head(&group->appliance_view, appliance);
         group->appliance_view_count++;
     }
-    static answer of_51(const std::string &node) { return get(STATE + "/51/" + node); }
+    static std::string of_51(const std::string &node) { return get(STATE + "/51/" + node); }
     int said(const std::string &line) { return engine.log.count(line); }
 };
 
@@ -154,7 +145,7 @@ TEST_F(DaemonMonitor, RoutersAreCountedByTheirPlace) {
     EXPECT_EQ(of_51("router/1/appliance/10.0.0.1/load_dist"), one(bn_type_uint32, "0"));
     EXPECT_EQ(of_51("router/1/appliance/10.0.0.3/load_dist"), NOTHING);
     EXPECT_EQ(said("wccp_get_router_appliance_info: failed: status=1"), 1);
-    EXPECT_EQ(of_51("router/1/appliance/nobody/load_dist"), (answer{LC_BAD_TYPE, 0, 0, ""}));
+    EXPECT_EQ(of_51("router/1/appliance/nobody/load_dist"), "status 14020");
 }
 
 TEST_F(DaemonMonitor, NodesThatOnlyStandForTheirChildren) {
@@ -168,7 +159,7 @@ TEST_F(DaemonMonitor, WhatIsNotThere) {
     for (const std::string node : {"oper", "debug", "appliance/1/weight"})
         EXPECT_EQ(get(STATE + "/7/" + node), NOTHING);
     EXPECT_EQ(said("wccp_get_grp_info failed: 1"), 3);
-    EXPECT_EQ(get(STATE + "/7/router/1/state"), (answer{1, 0, 0, ""}));
+    EXPECT_EQ(get(STATE + "/7/router/1/state"), "status 1");
     for (const char *node :
          {"colour", "router/1/colour", "oper/deeper", "router", "appliance", "router/1/appliance"})
         EXPECT_EQ(of_51(node), NOTHING);
@@ -179,8 +170,8 @@ TEST_F(DaemonMonitor, WhatIsNotThere) {
 }
 
 TEST_F(DaemonMonitor, TheTexts) {
-    const auto holds = [](const answer &got, const std::string &part) {
-        return got.count == 1 && got.type == bn_type_str && got.text.find(part) != std::string::npos;
+    const auto holds = [](const std::string &got, const std::string &part) {
+        return got.starts_with(one(bn_type_str, "")) && got.find(part) != std::string::npos;
     };
     EXPECT_EQ(get(SYSTEM + "proto_ver"), one(bn_type_str, "2.0"));
     EXPECT_EQ(get(SYSTEM + "is_alive"), one(bn_type_str, "Initializing"));
@@ -194,11 +185,11 @@ TEST_F(DaemonMonitor, TheTexts) {
         wccp_sending_router *router = add_router(group->sending_router_count + 20);
         router->view_appliance_count = WCCP_MAX_APPLIANCES;
     }
-    const answer cut = of_51("debug");
+    const std::string cut = of_51("debug");
     EXPECT_TRUE(holds(cut, "WCCP GROUP 51 INFO START"));
-    EXPECT_GT(cut.text.size(), 16000u);
-    EXPECT_LT(cut.text.size(), 16384u);
-    EXPECT_EQ(cut.text.back(), '\n');
+    EXPECT_GT(cut.size(), 16000u);
+    EXPECT_LT(cut.size(), 16384u);
+    EXPECT_EQ(cut.back(), '\n');
     EXPECT_EQ(of_51("assignment"), NOTHING);
     EXPECT_EQ(get(SYSTEM + "debug_all"), NOTHING);
     EXPECT_TRUE(holds(get(SYSTEM + "debug_global"), "debug buffer: used"));
@@ -212,16 +203,16 @@ TEST_F(DaemonMonitor, WhatIsListed) {
     second->view_appliance_count = 2;
     second->view_appliances[0].ipa = address(9);
     second->view_appliances[1].ipa = address(1);
-    EXPECT_EQ(children(STATE), (names{"0", "51", "200"}));
-    EXPECT_EQ(children(STATE + "/51/router"), (names{"1", "2"}));
-    EXPECT_EQ(children(STATE + "/51/router/2/appliance"), (names{"10.0.0.9", "10.0.0.1"}));
-    EXPECT_EQ(children(STATE + "/51/router/1/appliance"), names{});
-    EXPECT_EQ(children(STATE + "/200/router"), names{});
-    EXPECT_EQ(children(STATE + "/51"), names{});
-    EXPECT_EQ(children(STATE + "/51/appliance"), names{});
-    EXPECT_EQ(children(STATE + "/7/router"), names{});
+    EXPECT_EQ(children(STATE), "0 51 200 ");
+    EXPECT_EQ(children(STATE + "/51/router"), "1 2 ");
+    EXPECT_EQ(children(STATE + "/51/router/2/appliance"), "10.0.0.9 10.0.0.1 ");
+    EXPECT_EQ(children(STATE + "/51/router/1/appliance"), "");
+    EXPECT_EQ(children(STATE + "/200/router"), "");
+    EXPECT_EQ(children(STATE + "/51"), "");
+    EXPECT_EQ(children(STATE + "/51/appliance"), "");
+    EXPECT_EQ(children(STATE + "/7/router"), "");
     EXPECT_EQ(said("wccp_get_router_list: failed: status=1"), 1);
-    EXPECT_EQ(children(STATE + "/51/router/3/appliance"), names{});
+    EXPECT_EQ(children(STATE + "/51/router/3/appliance"), "");
     EXPECT_EQ(said("wccp_get_router_appliance_list failed: status=1"), 1);
     EXPECT_EQ(said("iterate " + STATE + "/51/router/2/appliance"), 1);
 }
