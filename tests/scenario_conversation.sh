@@ -120,11 +120,11 @@ case_silence() {
     lab_ctl r1 stop >/dev/null
     role a1 50 60 BACKUP
     group_is a1 5 60 '.router == null and .oper == "INIT"'
-    lab_wait_event 15 a1 '^alarm raised: eth0:grp:60 .*adjacency down' || die "no alarm"
+    lab_wait_event 60 a1 '^alarm raised: eth0:grp:60 .*adjacency down' || die "no alarm"
     lab_ctl r1 resume >/dev/null
     lab_ctl r2 resume >/dev/null
     role a1 60 60 ACTIVE
-    lab_wait_event 15 a1 '^alarm cleared: eth0:grp:60 .*adjacency down' || die "the alarm stands"
+    lab_wait_event 60 a1 '^alarm cleared: eth0:grp:60 .*adjacency down' || die "the alarm stands"
     finish a1
 }
 
