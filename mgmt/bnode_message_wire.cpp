@@ -102,7 +102,7 @@ static lc_status put_name_text(tbuffer *buffer, const char *name) {
     CHECK_STATUS(put_u32(buffer, 0));
     const char *part = name + absolute;
     uint32_t count = 0;
-    for (const char *end = part; *part || count; part = end + 1) {
+    for (const char *end; *part || count; part = end + 1) {
         end = bn_part_end(part);
         CHECK_STATUS(put_escaped_part(buffer, part, end));
         count++;

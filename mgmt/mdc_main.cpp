@@ -117,13 +117,13 @@ lc_status mdc_get_binding_children_ex(mdc *handle, uint32_t *out_code, tstring *
     return LC_OK;
 }
 
-static lc_status append_triples(bn_request_msg *request, uint32_t count, va_list *triples) {
+static lc_status append_triples(bn_request_msg *request, uint32_t count, va_list triples) {
     for (uint32_t i = 0; i < count; i++) {
-        const char *name = va_arg(*triples, const char *);
+        const char *name = va_arg(triples, const char *);
         if (!name)
             break;
-        const uint32_t type = va_arg(*triples, uint32_t);
-        const char *text = va_arg(*triples, const char *);
+        const uint32_t type = va_arg(triples, uint32_t);
+        const char *text = va_arg(triples, const char *);
         CHECK_STATUS(bn_action_request_msg_append_new_binding(request, 0, name, type, text, nullptr));
     }
     return LC_OK;
@@ -136,7 +136,7 @@ lc_status mdc_send_action_with_bindings_str_va(mdc *handle, uint32_t *out_code, 
     CHECK_STATUS(bn_action_request_msg_create(&request.pointer, action_name));
     va_list triples;
     va_start(triples, count);
-    const lc_status status = append_triples(request.pointer, count, &triples);
+    const lc_status status = append_triples(request.pointer, count, triples);
     va_end(triples);
     CHECK_STATUS(status);
     CHECK_STATUS(mdc_send_mgmt_msg(handle, request.pointer, 0, nullptr, out_code, out_message));
