@@ -52,7 +52,7 @@ enum : int32_t {
 struct gcl_options {
     uint32_t options;
     const std::atomic<int32_t> *ending; // null, or not 0 once no wait of this instance is to go on
-    void *open_service_hook; // providers only
+    void *open_service_hook;            // providers only
     void *open_service_argument;
 };
 lc_status gcl_options_get_defaults(gcl_options *out);
