@@ -18,6 +18,12 @@
 // buffer holds a few hundred; the rest would be lost at every tick, and routers time out. What a larger
 // buffer may hold is the kernel's memory and is taken only while it is full.
 //
+// Sending never waits. A router that is gone from the network is looked for by the kernel for three seconds,
+// and what is sent to it meanwhile stays in the socket's send buffer: a few such routers in many groups fill
+// it, and a send that waited would stand still under the engine lock, with the tick and all that is received.
+// So that buffer is as large as the other one, and where it is full all the same the message is lost, as on
+// the way; the next one comes with its timer.
+//
 // A datagram that is longer than the buffer is cut to it, and the tail is gone: what is handed on has the
 // length of the buffer, and the check of the message's own length decides.
 //
@@ -27,6 +33,7 @@
 #include "engine/wccp_network.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <net/if.h>
 #include <netinet/in.h>
 #include <poll.h>
@@ -46,7 +53,7 @@
 static pthread_mutex_t descriptor_lock = PTHREAD_MUTEX_INITIALIZER;
 
 static constexpr int WAIT_MS = 1000;
-static constexpr int RECEIVE_BUFFER = 16 << 20; // bytes, the kernel's own records of the datagrams included
+static constexpr int BUFFER = 16 << 20; // each way, bytes, the kernel's own records of the datagrams included
 
 static sockaddr_in socket_address(be32 address) {
     sockaddr_in out = {};
@@ -92,9 +99,9 @@ struct socket_option {
 } // namespace
 
 // As large as the kernel gives it.
-static void widen_receive_buffer(int fd) {
-    if (setsockopt(fd, SOL_SOCKET, SO_RCVBUFFORCE, &RECEIVE_BUFFER, sizeof RECEIVE_BUFFER) != 0)
-        (void)setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &RECEIVE_BUFFER, sizeof RECEIVE_BUFFER);
+static void widen_buffer(int fd, int forced, int within_limits) {
+    if (setsockopt(fd, SOL_SOCKET, forced, &BUFFER, sizeof BUFFER) != 0)
+        (void)setsockopt(fd, SOL_SOCKET, within_limits, &BUFFER, sizeof BUFFER);
 }
 
 // A datagram socket with these options, or -1; each failure has its line.
@@ -113,7 +120,9 @@ static int open_socket(const wccp_interface *interface, const char *open_failure
         close(fd);
         return -1;
     }
-    widen_receive_buffer(fd);
+    widen_buffer(fd, SO_RCVBUFFORCE, SO_RCVBUF);
+    widen_buffer(fd, SO_SNDBUFFORCE, SO_SNDBUF);
+    (void)fcntl(fd, F_SETFL, O_NONBLOCK);
     return fd;
 }
 

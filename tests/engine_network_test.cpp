@@ -233,6 +233,21 @@ TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), -2);
 }
 
+// Addresses that nobody has: what is sent to them stays in the buffer while the kernel looks for them.
+TEST_F(Network, RoutersThatAreGoneHoldNobodyUp) {
+    ASSERT_EQ(wccp_init_network_by_interface(wan), 0);
+    group.interfaces[0] = wan;
+    group.ucast_router_count = 32;
+    for (uint32_t i = 0; i < 32; i++)
+        group.ucast_routers[i] = ipa("10.0.0." + std::to_string(150 + i));
+    const auto began = std::chrono::steady_clock::now();
+    for (int round = 0; round < 300; round++) {
+        wccp_pkt pkt = packet(1400, 1);
+        wccp_tx_pkt(&group, &pkt);
+    }
+    EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::milliseconds(2500));
+}
+
 TEST_F(Network, OneDatagramIsReadAtATimeAndTheMulticastSocketFirst) {
     ASSERT_EQ(wccp_join_mc_grp(wan, ipa("224.0.1.5")), 0);
     const int router = engine.router_socket("10.0.0.3");
