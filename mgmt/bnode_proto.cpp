@@ -270,19 +270,20 @@ lc_status bn_event_request_msg_append_binding_takeover(bn_request_msg *msg, uint
     CHECK_STATUS(append_node(msg, bn_msg_event, 0, 0, inout_binding, out_node_id));
     return LC_OK;
 }
-lc_status bn_action_request_msg_append_new_binding(bn_request_msg *msg, uint32_t node_id, const char *name,
-                                                   uint32_t type, const char *text, uint32_t *out_node_id) {
+static lc_status append_new_binding(bn_request_msg *msg, uint16_t msg_type, const char *name, uint32_t type,
+                                    const char *text, uint32_t *out_node_id) {
     owned_binding binding;
     CHECK_STATUS(bn_binding_new_str_autoinval(&binding.pointer, name, bn_attrib_value, type, 0, text));
-    CHECK_STATUS(bn_action_request_msg_append_binding_takeover(msg, node_id, &binding.pointer, out_node_id));
+    CHECK_STATUS(append_node(msg, msg_type, 0, 0, &binding.pointer, out_node_id));
     return LC_OK;
 }
-lc_status bn_event_request_msg_append_new_binding(bn_request_msg *msg, uint32_t node_id, const char *name,
+lc_status bn_action_request_msg_append_new_binding(bn_request_msg *msg, uint32_t, const char *name,
+                                                   uint32_t type, const char *text, uint32_t *out_node_id) {
+    return append_new_binding(msg, bn_msg_action_request, name, type, text, out_node_id);
+}
+lc_status bn_event_request_msg_append_new_binding(bn_request_msg *msg, uint32_t, const char *name,
                                                   uint32_t type, const char *text, uint32_t *out_node_id) {
-    owned_binding binding;
-    CHECK_STATUS(bn_binding_new_str_autoinval(&binding.pointer, name, bn_attrib_value, type, 0, text));
-    CHECK_STATUS(bn_event_request_msg_append_binding_takeover(msg, node_id, &binding.pointer, out_node_id));
-    return LC_OK;
+    return append_new_binding(msg, bn_msg_event, name, type, text, out_node_id);
 }
 
 static lc_status get_text(const bn_request_msg *msg, uint16_t type, tstring **out) {

@@ -44,8 +44,11 @@ static lc_status put_header(const bn_attrib *attrib, tbuffer *buffer, uint32_t o
     return LC_OK;
 }
 
+// A new attribute with what the header says of it. On failure `out` is freed by its owner.
 static lc_status get_header(const tbuffer *buffer, uint32_t offset, uint32_t type, uint32_t kind,
-                            bn_attrib *attrib) {
+                            bn_attrib **out) {
+    CHECK_STATUS(bn_attrib_new(out));
+    bn_attrib *attrib = *out;
     uint32_t kind_read = 0, type_read = 0, flags = 0;
     CHECK_STATUS(get_number(buffer, offset, &kind_read));
     CHECK_STATUS(get_number(buffer, offset + 4, &attrib->attribute_id));
@@ -93,8 +96,7 @@ static lc_status read_sized(const tbuffer *buffer, uint32_t offset, uint32_t typ
     CHECK_NULL(out);
     *out = nullptr;
     owned<bn_attrib, bn_release_attrib> attrib;
-    CHECK_STATUS(bn_attrib_new(&attrib.pointer));
-    CHECK_STATUS(get_header(buffer, offset, type, kind, attrib.pointer));
+    CHECK_STATUS(get_header(buffer, offset, type, kind, &attrib.pointer));
     const bn_type_row *row = bn_type_find(type);
     CHECK_NULL(row);
     uint32_t size = 0;
@@ -154,8 +156,7 @@ static lc_status read_address(const tbuffer *buffer, uint32_t offset, uint32_t t
     CHECK_NULL(out);
     *out = nullptr;
     owned<bn_attrib, bn_release_attrib> attrib;
-    CHECK_STATUS(bn_attrib_new(&attrib.pointer));
-    CHECK_STATUS(get_header(buffer, offset, type, kind_wire_order, attrib.pointer));
+    CHECK_STATUS(get_header(buffer, offset, type, kind_wire_order, &attrib.pointer));
     uint8_t address[ADDRESS_SIZE];
     CHECK_STATUS(tb_get_uint128(buffer, offset + HEADER_SIZE + leading, address));
     if (has_value(attrib.pointer)) {
@@ -232,8 +233,7 @@ static lc_status read_counted(const tbuffer *buffer, uint32_t offset, uint32_t t
     owned<bn_attrib, bn_release_attrib> attrib;
     owned_text bytes;
     uint32_t length = 0, used = 0;
-    CHECK_STATUS(bn_attrib_new(&attrib.pointer));
-    CHECK_STATUS(get_header(buffer, offset, type, kind_counted, attrib.pointer));
+    CHECK_STATUS(get_header(buffer, offset, type, kind_counted, &attrib.pointer));
     CHECK_STATUS(tb_get_str(buffer, offset + HEADER_SIZE, -1, 0, 1, 1, &bytes.pointer, &length, &used));
     if (has_value(attrib.pointer)) {
         CHECK_STATUS(take(attrib.pointer, &bytes.pointer, length));
