@@ -94,6 +94,7 @@ done
 # Live, in a file and on a terminal, while wccpd hears no more of a router and mgmtd goes and comes.
 lab_start a1 lines mgmtctl show --watch
 lab_start a1 terminal /usr/bin/env TERM=xterm LANG=C.UTF-8 script -qfec "stty rows 24 columns 80; exec $WCCP_BIN/mgmtctl show --watch" /dev/null
+lab_start a1 guest /usr/bin/env TERM=xterm LANG=C script -qfec "stty rows 12 columns 80; exec $WCCP_BIN/mgmtctl show --watch --below 5" /dev/null
 lab_wait_line 5 '^[0-9:]{8}  group 51  ACTIVE, designated  routers 2/2  share 25% of 25%' "$LAB/a1-lines.out" ||
     fail "no line for the group"
 lab_stop r2 router KILL 2>/dev/null
@@ -108,12 +109,18 @@ lab_mgmtd_start a1
 lab_wccpd_start a1
 lab_wait_line 30 'wccpd Ready.* 1 group: 1 active' "$LAB/a1-terminal.out" || fail "the live picture does not come back"
 lab_stop a1 lines INT || fail "the lines ended with $?"
-read -r script _ <<<"$(lab_pid a1 terminal)"
-read -r live _ <"/proc/$script/task/$script/children"
-kill -INT "$live"
-lab_wait_exit 5 a1 terminal || fail "the live picture ended with $?"
+for name in terminal guest; do
+    read -r script _ <<<"$(lab_pid a1 $name)"
+    read -r live _ <"/proc/$script/task/$script/children"
+    kill -INT "$live"
+    lab_wait_exit 5 a1 $name || fail "the live picture ($name) ended with $?"
+done
 grep -aq $'^\033\\[?1049h' "$LAB/a1-terminal.out" && tail -c 40 "$LAB/a1-terminal.out" | grep -aqF $'\033[?25h\033[?1049l' ||
     fail "the terminal is not given back"
+# The guest leaves the upper five rows and the screen alone, and keeps to the lower seven.
+[ "$(grep -aoE $'\033[^A-Za-z]*[A-Za-z]' "$LAB/a1-guest.out" | grep -v 'm$' | sort -u | tr -d '\033\n')" = '[6H[J[K' ] &&
+    awk -v 'RS=\033[[]6H' '{ lines = gsub(/\n/, ""); if (lines > most) most = lines } END { exit most < 2 || most > 6 }' \
+        "$LAB/a1-guest.out" || fail "the picture below other rows: $(tail -n 20 "$LAB/a1-guest.out" | cat -v)"
 ! grep -aq $'\033' "$LAB/a1-lines.out" || fail "lines have controls in them"
 
 # Policy groups, and the end.

@@ -22,7 +22,8 @@ struct ctl_options {
     bool json = false;
     bool watch = false;
     bool secrets = false; // passwords are shown
-    int colour = -1; // 1 yes, 0 no, -1 when standard output is a terminal
+    int colour = -1;      // 1 yes, 0 no, -1 when standard output is a terminal
+    int below = 0;        // rows at the top of the terminal that are somebody else's
     int64_t timeout_ms = 10'000;
 };
 

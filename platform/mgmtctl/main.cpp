@@ -335,7 +335,10 @@ int main(int argc, char **argv) {
     command = add("policy", "policy groups: add, delete, list", [&] { return ctl_policy(options, words); });
     command->add_option("WORD", words);
     command = add("show", "the whole appliance in one screen", [&] { return ctl_show(options); });
-    command->add_flag("--watch", options.watch, "stay, and follow what changes");
+    CLI::Option *stay = command->add_flag("--watch", options.watch, "stay, and follow what changes");
+    command->add_option("--below", options.below, "leave so many rows at the top of the terminal alone")
+        ->check(CLI::Range(0, 1000))
+        ->needs(stay);
     command->add_flag_callback(
         "--colour", [&] { options.colour = 1; }, "in colour, whatever the output is");
     command->add_flag_callback(

@@ -3,8 +3,10 @@
 // A live picture is drawn anew each second and when mgmtd tells of something, at most ten times a second; a
 // picture that took long to gather leaves mgmtd and wccpd alone for longer than it took. On a terminal it has
 // the other screen and is written over in one piece; it gives the terminal back when a signal ends or stops
-// it. In a file or a pipe it is a line for whatever has changed, with the time, and as JSON a picture a line.
-// When mgmtd goes, a live picture says so and looks for it once a second.
+// it. Below rows that are somebody else's it is a guest: it takes no screen, hides no cursor, and says where
+// each picture begins, since the other may have moved the cursor in between. In a file or a pipe it is a line
+// for whatever has changed, with the time, and as JSON a picture a line. When mgmtd goes, a live picture says
+// so and looks for it once a second.
 #include <algorithm>
 #include <cerrno>
 #include <clocale>
@@ -24,6 +26,7 @@
 static constexpr int64_t PERIOD_MS = 1000;
 static constexpr int64_t BURST_MS = 100; // events within it are one
 static constexpr int FILE_COLUMNS = 120;
+static constexpr size_t PICTURE_BYTES = 1 << 16; // those of a large screen, with their colours
 static constexpr int GROUP_ROWS = 5; // of the least picture of a group that tells more than a line
 
 static volatile std::sig_atomic_t pause_wanted;
@@ -53,7 +56,7 @@ static screen_form form_of(const viewer &self) {
         // The last column and, beside a prompt, the last row stay free.
         const bool known = ioctl(STDOUT_FILENO, TIOCGWINSZ, &size) == 0 && size.ws_col > 0 && size.ws_row > 0;
         form.columns = std::max((known ? size.ws_col : 80) - 1, 20);
-        form.rows = std::max((known ? size.ws_row : 24) - (self.options.watch ? 0 : 1), 2);
+        form.rows = std::max((known ? size.ws_row : 24) - (self.options.watch ? self.options.below : 1), 2);
     }
     form.colour =
         self.options.colour == 1 || (self.options.colour == -1 && self.terminal && !getenv("NO_COLOR"));
@@ -73,7 +76,7 @@ static picture_limits limits_of(const viewer &self) {
 }
 
 static void take_screen(viewer *self, bool take) {
-    if (self->on_screen == take)
+    if (self->on_screen == take || self->options.below > 0)
         return;
     self->on_screen = take;
     write_out(self, take ? "\033[?1049h\033[?25l" : "\033[0m\033[?25h\033[?1049l");
@@ -129,7 +132,7 @@ static void show_one(viewer *self, const picture &shown) {
     if (self->options.watch)
         form.corner = "   " + clock_text();
     const std::vector<std::string> lines = draw_screen(shown, form);
-    std::string text = self->options.watch ? "\033[H" : "";
+    std::string text = self->options.watch ? "\033[" + std::to_string(self->options.below + 1) + "H" : "";
     for (size_t i = 0; i < lines.size(); i++) {
         text += lines[i];
         if (!self->options.watch)
@@ -163,12 +166,13 @@ static void take_signal(int number) {
         ctl_stop_signal = number;
 }
 
-// Those that would leave the terminal as it is; main has taken the others.
+// Those that would leave the terminal as it is; main has taken the others. What was ignored stays so.
 static void take_signals() {
-    struct sigaction action = {};
+    struct sigaction action = {}, before;
     action.sa_handler = take_signal; // without SA_RESTART: it ends a wait
     for (const int number : {SIGQUIT, SIGTSTP, SIGWINCH})
-        sigaction(number, &action, nullptr);
+        if (sigaction(number, nullptr, &before) == 0 && before.sa_handler != SIG_IGN)
+            sigaction(number, &action, nullptr);
 }
 
 static void wait_without_session() {
@@ -220,6 +224,8 @@ static bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *ou
 static int watch(viewer *self) {
     ctl_session *session = nullptr;
     take_signals();
+    if (self->terminal)
+        setvbuf(stdout, nullptr, _IOFBF, PICTURE_BYTES); // or each line is written by itself
     while (!ctl_stop_signal && !self->broken) {
         picture shown;
         if (!session) {
