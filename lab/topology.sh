@@ -76,16 +76,13 @@ lab_enter() { # SCRIPT ARGUMENTS...
         --propagation private bash "$script" "$@" <&0 &
     local holder=$! status
     # shellcheck disable=SC2064
-    trap "kill -KILL $holder 2>/dev/null; lab_farewell; exit 130" INT
+    trap "kill -KILL $holder 2>/dev/null; exit 130" INT
     # shellcheck disable=SC2064
-    trap "kill -KILL $holder 2>/dev/null; lab_farewell; exit 143" TERM HUP
+    trap "kill -KILL $holder 2>/dev/null; exit 143" TERM HUP
     wait $holder; status=$?
     trap - INT TERM HUP
-    lab_farewell
     exit $status
 }
-# Scripts that change the terminal define this anew, before lab_enter.
-lab_farewell() { :; }
 
 # ---- the inner side
 
