@@ -19,6 +19,11 @@
 // The closed library's thread lives until exit() is through and may call into the engine to the last: the
 // engine's records are plain objects without destructors, and the callbacks return at once when wccpd_exiting
 // is set.
+//
+// All memory is locked, so every mapped page counts, read or not: threads have small stacks
+// (engine/cthread.cpp), malloc one arena and no memory for what large buffers needed once, received bindings
+// no second copy of their names. scripts/memory.sh tells what is locked, by room; bench/daemon_start.sh at
+// full size.
 #include "daemon/wccpd_main.h"
 
 #include <cerrno>
