@@ -20,7 +20,11 @@
 #include <optional>
 #include <thread>
 
+#include <termios.h>
+#include <unistd.h>
+
 #include "mgmt/bnode_types.h"
+#include "platform/mgmtctl/edit_distance.h"
 #include "platform/mgmtctl/render.h"
 #include "platform/schema.h"
 #include "runtime/common.h"
@@ -28,6 +32,7 @@
 static const char *const GROUPS = "/qv/wccpd/wccp/srv_grp/config";
 static const char *const POLICIES = "/qv/wccpd/wccp/policy_grp/config";
 static const char *const STATES = "/qv/wccpd/wccp/srv_grp/state";
+static constexpr size_t SECRET_MAX = 256; // more than any password has; mgmtd says what is too long
 static const char *const TRIAL_END = "/mgmtctl/this/is/only/a/trial";
 
 const std::vector<group_word> &group_words() {
@@ -35,7 +40,7 @@ const std::vector<group_word> &group_words() {
         {"interface", "interface", "NAME, or none", true, false},
         {"router", "router", "ADDRESS, once for each router; together they are the new list", true, false},
         {"weight", "weight", nullptr, false, false},
-        {"password", "password", "up to 8 characters; \"\" for none", false, true},
+        {"password", "password", "up to 8 characters; \"\" for none, - to be asked for it", false, true},
         {"policy", "policy_grp", "1 to 65535, or none", false, false},
         {"admin", "admin", nullptr, false, false},
         {"priority", "priority", nullptr, true, false},
@@ -97,28 +102,12 @@ static group_result failed(group_result result, int exit, const std::string &err
 
 // --- Words
 
-static size_t distance(const std::string &a, const std::string &b) {
-    std::vector<size_t> row(b.size() + 1);
-    for (size_t j = 0; j <= b.size(); j++)
-        row[j] = j;
-    for (size_t i = 1; i <= a.size(); i++) {
-        size_t diagonal = row[0];
-        row[0] = i;
-        for (size_t j = 1; j <= b.size(); j++) {
-            const size_t above = row[j];
-            row[j] = std::min({row[j] + 1, row[j - 1] + 1, diagonal + (a[i - 1] == b[j - 1] ? 0 : 1)});
-            diagonal = above;
-        }
-    }
-    return row[b.size()];
-}
-
 static std::string unknown_word(const std::string &word, const std::vector<std::string> &known) {
     const std::string *nearest = nullptr;
     size_t best = 4;
     for (const std::string &candidate : known) {
         const bool begins = word.size() > 1 && candidate.starts_with(word);
-        const size_t away = begins ? 0 : distance(word.substr(0, 32), candidate);
+        const size_t away = begins ? 0 : edit_distance(word.substr(0, 32), candidate);
         if (away < best && away < candidate.size()) {
             best = away;
             nearest = &candidate;
@@ -225,6 +214,7 @@ static std::vector<std::string> routers_of(const group_nodes &nodes) {
         if (name.starts_with("router/") && name.ends_with("/ipaddr"))
             numbered[std::atol(name.c_str() + 7)] = value;
     std::vector<std::string> out;
+    out.reserve(numbered.size());
     for (const auto &[number, address] : numbered)
         out.push_back(address);
     return out;
@@ -240,7 +230,7 @@ static std::vector<ctl_change_item> creation(const std::string &root, const grou
     std::vector<ctl_change_item> items = {{ctl_change::create, {root, "", root.substr(root.rfind('/') + 1)}}};
     for (const auto &[name, value] : nodes)
         if (!name.starts_with("router/") || name.ends_with("/ipaddr")) // an entry comes with its address
-            items.push_back({ctl_change::create, {root + "/" + name, "", value}});
+            items.push_back({ctl_change::create, {std::string(root).append("/").append(name), "", value}});
     return items;
 }
 
@@ -382,17 +372,35 @@ static void group_add(const group_link &link, const std::string &root, const wan
     }
 }
 
-static void group_set(const group_link &link, const std::string &root, const wanted_group &wish,
-                      group_result *inout) {
+// Of a group that has to be there, what was set.
+static bool read_standing(const group_link &link, const std::string &root, group_nodes *out,
+                          group_result *inout) {
     bool there = false;
-    group_nodes before;
     if (!stands(link, root, inout, &there))
-        return;
+        return false;
     if (!there) {
         *inout = failed(*inout, CTL_NOT_FOUND, "there is no group " + std::to_string(inout->number));
-        return;
+        return false;
     }
-    if (!read_group(link, root, &before, inout))
+    return read_group(link, root, out, inout);
+}
+
+// For a group that doesn't run as it stands in the configuration, since it was changed node by node.
+static void group_restart(const group_link &link, const std::string &root, group_result *inout) {
+    group_nodes nodes;
+    if (!read_standing(link, root, &nodes, inout))
+        return;
+    recreate(link, root, nodes, nodes, inout);
+    if (inout->done == "recreated")
+        inout->note = what_it_lacks(nodes);
+    if (inout->done != "deleted" && !inout->done.empty())
+        settle(link, true, inout);
+}
+
+static void group_set(const group_link &link, const std::string &root, const wanted_group &wish,
+                      group_result *inout) {
+    group_nodes before;
+    if (!read_standing(link, root, &before, inout))
         return;
     group_nodes after = before;
     std::vector<ctl_change_item> in_place;
@@ -414,8 +422,8 @@ static void group_set(const group_link &link, const std::string &root, const wan
             after[node] = *value;
         else
             after.erase(node);
-        in_place.push_back(
-            {value ? ctl_change::modify : ctl_change::reset, {root + "/" + node, "", value.value_or("")}});
+        in_place.push_back({value ? ctl_change::modify : ctl_change::reset,
+                            {std::string(root).append("/").append(node), "", value.value_or("")}});
         if (word->whole || (!value && !fallback))
             as_whole += std::string(as_whole.empty() ? "" : ", ") + word->word;
     }
@@ -442,21 +450,23 @@ static void remove_root(const group_link &link, const std::string &root, group_r
                         "there is no " + inout->kind + " " + std::to_string(inout->number), inout->code);
 }
 
-static const char *const GROUP_USAGE = "group add N [WORD VALUE ...], group set N WORD VALUE ..., "
-                                       "group delete N; \"group words\" lists the words";
+static const char *const GROUP_USAGE =
+    "group add N [WORD VALUE ...], group set N WORD VALUE ..., group restart "
+    "N, group delete N; \"group words\" lists the words";
 
 group_result group_command(const group_link &link, const std::vector<std::string> &words) {
     group_result result;
     result.kind = "group";
     const std::string verb = words.empty() ? "" : words[0];
-    if (verb != "add" && verb != "set" && verb != "delete")
+    if (verb != "add" && verb != "set" && verb != "restart" && verb != "delete")
         return failed(result, CTL_USAGE,
-                      verb.empty() ? GROUP_USAGE
-                                   : unknown_word(verb, {"add", "set", "delete", "list", "words"}));
+                      verb.empty()
+                          ? GROUP_USAGE
+                          : unknown_word(verb, {"add", "set", "restart", "delete", "list", "words"}));
     if (words.size() < 2 || !parse_number(words[1], &result.number) || (verb == "set" && words.size() < 3))
         return failed(result, CTL_USAGE, GROUP_USAGE);
     wanted_group wish;
-    if (verb == "delete" && words.size() > 2)
+    if ((verb == "delete" || verb == "restart") && words.size() > 2)
         return failed(result, CTL_USAGE, GROUP_USAGE);
     if (const std::string wrong = parse_wish(words, &wish); !wrong.empty())
         return failed(result, CTL_USAGE, wrong);
@@ -465,6 +475,8 @@ group_result group_command(const group_link &link, const std::vector<std::string
         group_add(link, root, wish, &result);
     } else if (verb == "set") {
         group_set(link, root, wish, &result);
+    } else if (verb == "restart") {
+        group_restart(link, root, &result);
     } else {
         remove_root(link, root, &result);
         if (result.exit == CTL_OK)
@@ -662,10 +674,37 @@ static int run(const ctl_options &options, const std::vector<std::string> &words
     return tell(options, command(link, words));
 }
 
+// A line of standard input, which everybody on the machine could read in a command line. A terminal is asked,
+// and doesn't show it. False at the end of the input, or when a signal ends the program.
+static bool read_secret(std::string *out) {
+    termios before = {};
+    const bool terminal = tcgetattr(STDIN_FILENO, &before) == 0;
+    if (terminal) {
+        termios silent = before;
+        silent.c_lflag &= ~static_cast<tcflag_t>(ECHO);
+        fputs("password: ", stderr);
+        (void)tcsetattr(STDIN_FILENO, TCSAFLUSH, &silent);
+    }
+    char byte = '\0';
+    ssize_t got = 0;
+    out->clear();
+    while (out->size() < SECRET_MAX && (got = read(STDIN_FILENO, &byte, 1)) == 1 && byte != '\n')
+        *out += byte;
+    if (terminal) {
+        (void)tcsetattr(STDIN_FILENO, TCSAFLUSH, &before);
+        fputc('\n', stderr);
+    }
+    return got == 1 || (got == 0 && !out->empty());
+}
+
 int ctl_group(const ctl_options &options, const std::vector<std::string> &words) {
     if (words.size() == 1 && words[0] == "words")
         return list_words(options);
-    return run(options, words, GROUPS, "group", group_command);
+    std::vector<std::string> filled = words;
+    for (size_t i = 3; i < filled.size(); i += 2)
+        if (filled[i - 1] == "password" && filled[i] == "-" && !read_secret(&filled[i]))
+            return tell_failure(options, {CTL_USAGE, "", "there is no password on standard input", "", 0});
+    return run(options, filled, GROUPS, "group", group_command);
 }
 
 int ctl_policy(const ctl_options &options, const std::vector<std::string> &words) {

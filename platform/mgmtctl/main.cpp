@@ -5,6 +5,7 @@
 // away; then the program ends by the signal after all, for the shell to see. SIGPIPE is not taken, since a
 // session that is lost must be told; a pipe behind standard output that nobody reads any more is found out at
 // the end and ends the program as it would have.
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
@@ -176,6 +177,7 @@ static int set(const ctl_options &options, const std::vector<std::string> &words
 
 static int remove(const ctl_options &options, const std::vector<std::string> &names) {
     std::vector<ctl_change_item> items;
+    items.reserve(names.size());
     for (const std::string &name : names)
         items.push_back({ctl_change::remove, {name, "", ""}});
     return change(options, items);
@@ -283,6 +285,7 @@ static int usage_error(const CLI::App &app, const std::vector<std::string> &argu
     return CTL_USAGE;
 }
 
+// NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
     ctl_options options;
     double seconds = 10;
@@ -329,7 +332,7 @@ int main(int argc, char **argv) {
     command->add_option("--count", count, "end after so many events");
     command = add("alarms", "the alarms that stand", [&] { return alarms(options, check); });
     command->add_flag("--check", check, "exit with 6 when there are any");
-    command = add("group", "service groups: add, set, delete, list, words",
+    command = add("group", "service groups: add, set, restart, delete, list, words",
                   [&] { return ctl_group(options, words); });
     command->add_option("WORD", words);
     command = add("policy", "policy groups: add, delete, list", [&] { return ctl_policy(options, words); });
@@ -357,9 +360,12 @@ int main(int argc, char **argv) {
             return app.exit(error) == 0 ? finish(CTL_OK) : CTL_USAGE; // --help
         return usage_error(app, arguments, error.what());
     }
+    words.push_back(name);
     for (std::string &word : words)
         if (word.starts_with(SHIELD))
             word.erase(0, 1);
-    options.timeout_ms = static_cast<int64_t>(seconds * 1000);
+    name = words.back();
+    words.pop_back();
+    options.timeout_ms = static_cast<int64_t>(std::max(1.0, seconds * 1000)); // 1 also for "nan"
     return finish(run());
 }

@@ -13,6 +13,7 @@
 #include <map>
 
 #include "mgmt/bnode_types.h"
+#include "platform/mgmtctl/edit_distance.h"
 #include "platform/mgmtctl/groups.h"
 #include "runtime/common.h"
 
@@ -43,6 +44,7 @@ static std::string number_of(const std::string &root) {
 static const std::vector<node_name> &patterns() {
     static const std::vector<node_name> all = [] {
         std::vector<node_name> made;
+        made.reserve(schema().size() + wccpd_state_nodes().size());
         for (const schema_row &row : schema())
             made.push_back(row.parts);
         for (const char *pattern : wccpd_state_nodes())
@@ -83,39 +85,20 @@ std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above)
                 choice = false;
             }
     }
-    std::vector<node_name> sorted;
-    for (const std::string &part : found)
-        sorted.push_back({{part}});
-    std::sort(sorted.begin(), sorted.end());
-    std::vector<std::string> out;
-    for (const node_name &one : sorted)
-        out.push_back(one.parts[0]);
+    std::vector<std::string> out(found.begin(), found.end());
+    std::sort(out.begin(), out.end(), [](const std::string &a, const std::string &b) {
+        return node_name{{a}} < node_name{{b}}; // numbers as numbers
+    });
     return out;
 }
 
 // --- Names that were meant
 
-static size_t distance(const std::string &a, const std::string &b) {
-    std::vector<size_t> row(b.size() + 1);
-    for (size_t j = 0; j <= b.size(); j++)
-        row[j] = j;
-    for (size_t i = 1; i <= a.size(); i++) {
-        size_t diagonal = row[0];
-        row[0] = i;
-        for (size_t j = 1; j <= b.size(); j++) {
-            const size_t above = row[j];
-            row[j] = std::min({row[j] + 1, row[j - 1] + 1, diagonal + (a[i - 1] == b[j - 1] ? 0 : 1)});
-            diagonal = above;
-        }
-    }
-    return row[b.size()];
-}
-
 static const std::string *nearest(const std::string &wanted, const std::vector<std::string> &known) {
     const std::string *best = nullptr;
     size_t least = std::min<size_t>(3, wanted.size()); // as many mistakes are another word
     for (const std::string &each : known)
-        if (const size_t away = distance(wanted.substr(0, 64), each); away < least) {
+        if (const size_t away = edit_distance(wanted.substr(0, 64), each); away < least) {
             least = away;
             best = &each;
         }
@@ -174,7 +157,7 @@ static std::vector<std::string> value_completions(const std::string &name_text, 
         const std::string word = words.substr(0, words.find('|'));
         words.erase(0, word.size() + 1);
         if (word.starts_with(begin))
-            out.push_back(name_text + "=" + word);
+            out.push_back(std::string(name_text).append("=").append(word));
     }
     return out;
 }
@@ -280,10 +263,9 @@ static const ctl_binding *find_binding(const std::vector<ctl_binding> &bindings,
 // The part of the name behind its group when wccpd takes a change of the node only with the whole group.
 static std::string whole_word(const std::string &name, const std::string &root) {
     const std::string rest = name.size() > root.size() ? name.substr(root.size() + 1) : "";
-    const std::string first = rest.substr(0, rest.find('/'));
     for (const group_word &word : group_words())
-        if (word.whole && first == word.node)
-            return first;
+        if (word.whole && rest.substr(0, rest.find('/')) == word.node)
+            return word.node;
     return "";
 }
 
@@ -324,13 +306,14 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
     for (const auto &[root, words] : dropped)
         if (!ended.contains(root))
             out.notes.push_back("group " + number_of(root) + ": without " + joined(words) +
-                                " wccpd lets a running group go; it comes back when the group is deleted and "
-                                "created again");
+                                " wccpd lets a running group go, until \"mgmtctl group restart " +
+                                number_of(root) + "\"");
     for (const auto &[root, words] : not_followed)
         if (!ended.contains(root) && !dropped.contains(root))
-            out.notes.push_back(
-                "group " + number_of(root) + ": a running group follows a change of " + joined(words) +
-                " only when it is deleted and created again, as \"mgmtctl group set\" does it");
+            out.notes.push_back("group " + number_of(root) + ": a running group follows a change of " +
+                                joined(words) +
+                                " only when it is deleted and created again: \"mgmtctl group restart " +
+                                number_of(root) + "\"");
     if (touched.size() > 1 && (!out.created.empty() || !ended.empty()) &&
         touched.size() > out.created.size() + ended.size())
         out.notes.push_back(
