@@ -72,9 +72,31 @@ struct parser {
     std::string section; // "" or an absolute name
     bool skipping;       // the section was refused, and its lines with it
     std::string pending; // comment lines that wait for what they belong to
+    std::string heading; // those in front of a section of which nothing has come yet
     std::map<node_name, int> line_of;
 };
 } // namespace
+
+// The section that a node is written in: its outermost instance, or what stands above it.
+static node_name section_of(const node_name &name) {
+    node_name above;
+    for (const std::string &part : name.parts) {
+        above.parts.push_back(part);
+        const schema_row *row = find_schema_row(above);
+        if (row && row->instance)
+            return above;
+    }
+    above.parts.pop_back();
+    return above;
+}
+
+// A section as somebody divides the file need not be one that is written: its comment goes with its first
+// node.
+static void place_heading(parser *state, const node_name &name) {
+    if (!state->heading.empty())
+        state->comments->before["[" + section_of(name).text() + "]"] += state->heading;
+    state->heading.clear();
+}
 
 static bool take_section(parser *state, const std::string &line, std::string *out_reason) {
     const std::string name_text = trimmed(line.substr(1, line.size() - 2));
@@ -103,9 +125,10 @@ static bool take_section(parser *state, const std::string &line, std::string *ou
         return false;
     }
     state->section = name.text();
-    if (!state->pending.empty())
-        state->comments->before["[" + state->section + "]"] += state->pending;
+    state->heading += state->pending;
     state->pending.clear();
+    if (row && row->instance)
+        place_heading(state, name);
     return true;
 }
 
@@ -146,6 +169,7 @@ static bool take_value(parser *state, const std::string &line, int number, std::
         if (parent && parent->instance)
             state->tree->set[above] = above.parts.back();
     }
+    place_heading(state, name);
     if (!state->pending.empty())
         state->comments->before[name.text()] += state->pending;
     state->pending.clear();
@@ -157,7 +181,7 @@ bool config_parse(const std::string &content, const std::string &file, node_tree
     out_tree->set.clear();
     out_comments->before.clear();
     out_errors->clear();
-    parser state{out_tree, out_comments, "", false, "", {}};
+    parser state{out_tree, out_comments, "", false, "", "", {}};
     int number = 0;
     for (size_t at = 0; at < content.size();) {
         const size_t end = std::min(content.find('\n', at), content.size());
@@ -181,8 +205,8 @@ bool config_parse(const std::string &content, const std::string &file, node_tree
         if (!good)
             out_errors->append(file).append(":" + std::to_string(number) + ": ").append(reason + "\n");
     }
-    if (!state.pending.empty())
-        out_comments->before[""] = state.pending;
+    if (const std::string last = state.heading + state.pending; !last.empty())
+        out_comments->before[""] = last;
     tree_refresh(out_tree);
     std::string reason;
     if (out_errors->empty() && !tree_check(*out_tree, &reason)) {
@@ -196,19 +220,6 @@ bool config_parse(const std::string &content, const std::string &file, node_tree
         *out_errors = file + ":" + (line ? std::to_string(line) + ": " : " ") + reason + "\n";
     }
     return out_errors->empty();
-}
-
-// The section that a node is written in: its outermost instance, or what stands above it.
-static node_name section_of(const node_name &name) {
-    node_name above;
-    for (const std::string &part : name.parts) {
-        above.parts.push_back(part);
-        const schema_row *row = find_schema_row(above);
-        if (row && row->instance)
-            return above;
-    }
-    above.parts.pop_back();
-    return above;
 }
 
 std::string config_format(const node_tree &tree, const config_comments &comments) {

@@ -3,8 +3,9 @@
 //
 // The state nodes of each daemon stand beside the schema; a query below one of their roots goes to the
 // daemon's session, all nodes of it in one request, with the rows in front as registration nodes. A query of
-// a subtree that holds such a root takes it along, and is none the worse when the daemon isn't there. The
-// daemon whose session it is asks for its configuration only; it is never asked for what it asked for.
+// a subtree that holds such a root takes it along, and is none the worse when the daemon isn't there or
+// refuses. A node that can't be told in a message is left out, so that no asker waits in vain. The daemon
+// whose session it is asks for its configuration only; it is never asked for what it asked for.
 #include <algorithm>
 
 #include "mgmt/bnode_proto.h"
@@ -180,8 +181,7 @@ void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
     if (bn_query_response_msg_create(&response.pointer, msg->msg_id, code, message.c_str()) != LC_OK)
         return;
     for (const found_node &found : answered)
-        if (!append_answer(response.pointer, found.asked_id, found.node->first.text(), found.node->second))
-            return;
+        (void)append_answer(response.pointer, found.asked_id, found.node->first.text(), found.node->second);
     (void)server_send_response(self, peer_id, response.pointer, msg->transaction_id);
 }
 
@@ -192,8 +192,10 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
     const pending_query query = std::move(found->second);
     self->pending.erase(found);
     owned_response response;
-    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, msg->return_code,
-                                     msg->return_message ? ts_str(msg->return_message) : "") != LC_OK)
+    const bool told = query.whole && msg->return_message;
+    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id,
+                                     query.whole ? msg->return_code : 0,
+                                     told ? ts_str(msg->return_message) : "") != LC_OK)
         return;
     for (const auto &[node_id, field] : query.answered)
         (void)append_answer(response.pointer, node_id, field.name, field.value);

@@ -9,7 +9,12 @@
 #include <ctime>
 
 #include "platform/mgmtd/server.h"
+#include "platform/schema.h"
 #include "runtime/ttime.h"
+
+// Of what a report says, as much is kept as a person reads; with ALARMS_MAX of them a walk still fits in one
+// message.
+static constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
 
 static const char *const ALARMS = "/qv/alarms/state/raised";
 static const char *const ROLES = "/qv/alarms/state/role";
@@ -42,9 +47,10 @@ static bool keep_report(server *self, uint32_t peer_id, const node_name &root) {
     return true;
 }
 
-static std::string text_or(const std::vector<event_field> &fields, const char *name, const char *otherwise) {
+static std::string text_or(const std::vector<event_field> &fields, const char *name, const char *otherwise,
+                           size_t most = SOURCE_MAX) {
     const std::string *text = find_field(fields, name);
-    return text && !text->empty() ? *text : otherwise;
+    return text && !text->empty() ? text->substr(0, most) : otherwise;
 }
 
 static node_name alarm_root(const std::vector<event_field> &fields) {
@@ -57,7 +63,7 @@ static void take_raise(server *self, uint32_t peer_id, const std::vector<event_f
         self->say("alarm lost, too many stand: " + root.text());
         return;
     }
-    const std::string comment = text_or(fields, "comment", "");
+    const std::string comment = text_or(fields, "comment", "", TEXT_MAX);
     self->state[root] = {bn_type_str, comment};
     self->state[root.below("name")] = {bn_type_str, alarm_name(root.parts[root.parts.size() - 2])};
     self->state[root.below("since")] = time_now();
@@ -68,7 +74,7 @@ static void take_raise(server *self, uint32_t peer_id, const std::vector<event_f
 static void take_clear(server *self, uint32_t, const std::vector<event_field> &fields) {
     const node_name root = alarm_root(fields);
     remove_report(self, root);
-    self->say("alarm cleared: " + root.parts.back() + " " + text_or(fields, "comment", ""));
+    self->say("alarm cleared: " + root.parts.back() + " " + text_or(fields, "comment", "", TEXT_MAX));
 }
 
 static void take_role(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
@@ -76,8 +82,11 @@ static void take_role(server *self, uint32_t peer_id, const std::vector<event_fi
     if (!keep_report(self, peer_id, root))
         return;
     const char *role = role_name(text_or(fields, "role", ""));
+    std::string code;
+    if (!canonical_text(bn_type_uint32, text_or(fields, "code", "0"), &code))
+        code = "0";
     self->state[root] = {bn_type_str, role};
-    self->state[root.below("code")] = {bn_type_uint32, text_or(fields, "code", "0")};
+    self->state[root.below("code")] = {bn_type_uint32, code};
     self->state[root.below("since")] = time_now();
     self->say("role of group " + root.parts.back() + ": " + role);
 }

@@ -9,15 +9,25 @@
 // user that nobody else may write to. The lock on it, held as long as the process lives, keeps a second
 // mgmtd off, and tells that a socket found in it is left over. The kernel says who a client is; only root
 // and our own user are let in.
+//
+// A client binds a name there too, and removes it when it ends. What a killed one leaves is removed when
+// mgmtd starts and with each session that comes. Not when a session ends: then its process is still about to
+// go, and all sessions of a process share one name. A name that goes too early harms nobody, since a session
+// is connected by then, or connects to mgmtd's name and not to its own.
 #include "platform/mgmtd/transport.h"
 
 #include <algorithm>
 #include <cerrno>
+#include <charconv>
 #include <climits>
+#include <csignal>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
+#include <string_view>
 #include <vector>
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <poll.h>
 #include <pwd.h>
@@ -65,11 +75,42 @@ static bool open_directory(transport *self, std::string *out_error) {
     return true;
 }
 
+// The process that a client's socket is of, by its name "uds-client-NAME-PID"; 0 for other files.
+static pid_t client_of_socket(std::string_view file) {
+    pid_t pid = 0;
+    const size_t dash = file.rfind('-');
+    if (!file.starts_with("uds-client-") || dash == std::string_view::npos)
+        return 0;
+    const char *end = file.data() + file.size();
+    const auto [last, error] = std::from_chars(file.data() + dash + 1, end, pid);
+    return error == std::errc() && last == end && pid > 0 ? pid : 0;
+}
+
+static void remove_left_over(const transport *self) {
+    const int fd = openat(self->directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    DIR *opened = fd < 0 ? nullptr : fdopendir(fd);
+    if (!opened) {
+        if (fd >= 0)
+            close(fd);
+        return;
+    }
+    const std::unique_ptr<DIR, int (*)(DIR *)> files(opened, closedir);
+    while (const dirent *file = readdir(files.get())) {
+        const pid_t pid = client_of_socket(file->d_name);
+        struct stat about;
+        if (pid > 0 && kill(pid, 0) != 0 && errno == ESRCH &&
+            fstatat(self->directory, file->d_name, &about, AT_SYMLINK_NOFOLLOW) == 0 &&
+            S_ISSOCK(about.st_mode))
+            unlinkat(self->directory, file->d_name, 0);
+    }
+}
+
 bool transport_listen(transport *self, server *owner, std::string *out_error) {
     self->owner = owner;
     owner->send = [self](uint32_t id, uint16_t mtype, tbuffer *frame) { send_bnode(self, id, mtype, frame); };
     if (!open_directory(self, out_error))
         return false;
+    remove_left_over(self);
     self->socket_path = provider_path();
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
@@ -313,6 +354,7 @@ static void accept_session(transport *self) {
     const int fd = accept4(self->listener, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
     if (fd < 0)
         return;
+    remove_left_over(self);
     ucred credentials{};
     socklen_t length = sizeof credentials;
     const bool known = getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &credentials, &length) == 0;
