@@ -207,7 +207,9 @@ static std::string do_fault(const command_call &call) {
 static std::string do_raw(const command_call &call) {
     bytes data;
     const std::string &hex = call.words[1];
-    for (size_t i = 0; i + 1 < hex.size(); i += 2) {
+    if (hex.size() % 2 != 0)
+        return "error: that is no hex";
+    for (size_t i = 0; i < hex.size(); i += 2) {
         uint8_t value = 0;
         if (std::from_chars(&hex[i], &hex[i] + 2, value, 16).ptr != &hex[i] + 2)
             return "error: that is no hex";
