@@ -49,7 +49,7 @@ source "$top/lab/topology.sh"
 give_back() {
     local nothing
     trap '' INT TERM HUP
-    exec {everybody}>&-
+    exec 2>/dev/null {everybody}>&- # no word of the shell's about what was killed
     read -r -t 5 nothing <&"$everybody_gone"
     printf '\033[0m\033[?25h\033[?1049l'
     cat <&"$told"
@@ -236,7 +236,7 @@ operate a2 group set 51 weight 180
 await 40 17 'the first mask table' group_is 52 "$shares == [50, 50]"
 fact 52
 tell_step 'a1 hears of the weight with an I-See-You, and makes a new table of group 51'
-await 40 5 'the hash table by the new weights' group_is 51 "$shares == [25, 75]"
+await 40 2 'the hash table by the new weights' group_is 51 "$shares == [25, 75]"
 fact 51
 
 tell_step 'a1 dies without a word; the routers send it traffic for 25 s more, then ask'

@@ -1,5 +1,6 @@
 #!/bin/bash
-# The demo runs to its end without a terminal, by the faster clock, and tshark finds nothing wrong in the packets that it kept.
+# The demo runs to its end without a terminal, by the faster clock, and tshark finds nothing wrong in the packets that it
+# kept. On a terminal it shows the live picture; interrupted, it gives the terminal back and leaves no process.
 #   scenario_capture.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
@@ -14,6 +15,10 @@ fail() { echo "FAILED: $*"; failed=1; }
 
 "$top/scripts/demo.sh" --no-build --plain --capture "$file" </dev/null >"$scratch/out" 2>&1 || fail "the demo ended with $?"
 cat "$scratch/out"
+for line in '  group 51: a2 is ACTIVE; hash: a1 96, a2 160; asked 38%, 63%; has 37%, 62%' '  group 52: a2 is ACTIVE; mask: a1 32, a2 32;' \
+    '  group 51: a2 is ACTIVE; hash: a1 64, a2 192; asked 25%, 75%; has 25%, 75%' '51  ACTIVE, designated  up .*  weight 180'; do
+    grep -q "$line" "$scratch/out" || fail "the demo does not say: $line"
+done
 
 shark() { tshark -r "$file" "$@" 2>/dev/null; }
 count() { shark -Y "$1" | wc -l; }
@@ -31,4 +36,17 @@ expect "I-See-You" "wccp.message == 11" 20 400
 # To two routers: A's first table twice, its second and both of B's at least once.
 expect "Redirect-Assign" "wccp.message == 12" 10 100
 expect "Removal Query" "wccp.message == 13" 2 8
+
+# The picture stands below the demo's six rows; ^C comes when it does.
+mark=demo-$$-$RANDOM
+coproc typist { until grep -aq 'wccpd Ready' "$scratch/screen" 2>/dev/null; do sleep 0.2; done; sleep 0.5; printf '\003'; sleep 5; }
+DEMO_MARK=$mark TERM=xterm timeout 60 script -qfec "stty rows 24 columns 80; exec '$top/scripts/demo.sh' --no-build" "$scratch/screen" \
+    <&"${typist[0]}" >/dev/null; status=$?
+[ $status = 130 ] || fail "the interrupted demo ended with $status"
+grep -aq $'^\033\\[?1049h' "$scratch/screen" && grep -aq $'\033\\[7Hwccpd Ready\|\033\\[7H\033\\[1mwccpd Ready' "$scratch/screen" &&
+    grep -aq -- '--- a2# mgmtctl show --watch ---' "$scratch/screen" || fail "no live picture: $(cat -v "$scratch/screen")"
+tr -d '\r' <"$scratch/screen" | awk -v 'RS=\033[[][?]1049l' 'END { exit !(NR == 2 && /^0:0[0-9] Start of routers/ && !/\033/) }' ||
+    fail "the terminal is not given back: $(tail -n 20 "$scratch/screen" | cat -v)"
+left=$(grep -lzx "DEMO_MARK=$mark" /proc/[0-9]*/environ 2>/dev/null)
+[ -z "$left" ] || fail "the interrupted demo leaves $left"
 exit $failed
