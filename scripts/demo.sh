@@ -17,7 +17,9 @@ while [ $# -gt 0 ]; do
     case $1 in
     --capture) capture=$(readlink -f "${2?a file}") || exit 2; shift 2 ;;
     --plain) plain=yes; shift ;;
-    --speed) export LAB_SPEED=${2?a number}; shift 2 ;;
+    --speed)
+        [[ ${2?a number} =~ ^[1-9][0-9]*(\.[0-9]+)?$ ]] || { echo "demo: a speed of $2?" >&2; exit 2; }
+        export LAB_SPEED=$2; shift 2 ;;
     --no-build) build=''; shift ;;
     *) sed -n '2,11s/^# \{0,1\}//p' "$0"; exit 2 ;;
     esac
@@ -57,7 +59,8 @@ give_back() {
 if [ -z "$plain" ] && [ "${LAB_INSIDE-}" != 1 ]; then
     scratch=$(mktemp -d) || exit 1
     mkfifo "$scratch/pipe" || exit 1
-    exec {both}<>"$scratch/pipe" {everybody_gone}<"$scratch/pipe" {everybody}>"$scratch/pipe" {tell}>"$scratch/told" {told}<"$scratch/told"
+    exec {both}<>"$scratch/pipe" {everybody_gone}<"$scratch/pipe" {everybody}>"$scratch/pipe"
+    exec {tell}>"$scratch/told" {told}<"$scratch/told"
     exec {both}>&-
     rm -r "$scratch"
     export tell
