@@ -235,6 +235,7 @@ lab_stop() { # NODE NAME [SIGNAL]
     if [ -n "$inner" ]; then
         [ "${3-}" != KILL ] || lab_expect_sockets "$1" "$2" "$inner"
         kill -s "${3-TERM}" "$inner"
+        kill -s CONT "$pid" 2>/dev/null # nsenter stops itself with a program that was stopped
     fi
     for i in $(seq 300); do
         kill -0 "$pid" 2>/dev/null || { wait "$pid"; return; }

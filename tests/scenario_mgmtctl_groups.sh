@@ -19,12 +19,13 @@ expect() { # STATUS EXPRESSION WORDS...
     [ $got = "$status" ] || fail "$* ended with $got, not $status: $said"
     jq -e "$expression" <<<"$said" >/dev/null || fail "$* says otherwise than $expression: $said"
 }
-shown() { lab_wait 30 "$1" lab_manage a1 show || fail "the picture does not come to show $1"; }
+shown() { lab_wait 60 "$1" lab_manage a1 show || fail "the picture does not come to show $1"; }
 
 lab_router r1 10.0.0.1
 lab_router r2 10.0.0.2
 lab_appliance a1 10.0.0.101
 lab_appliance a2 10.0.0.102
+GROUP=/qv/wccpd/wccp/srv_grp/config
 config=/proc/${LAB_INIT[a1]}/root$LAB_CONFIG
 LAB_FOUND[a1]=$(lab_remains a1)
 
@@ -46,7 +47,7 @@ expect 0 '.wccpd == "running" and .status == "Ready" and .groups_total == 0' sho
 expect 2 '.error | test("did you mean .weight")' group add 51 wieght 100
 expect 1 '.code == 14008 and .commits == 0' group add 51 interface eth0 router 10.0.0.999
 expect 0 '.done == "added" and .commits == 1 and .running and .state == "INIT"' \
-    group add 51 interface eth0 router 10.0.0.1 weight 30 assign hash priority 10 password secret
+    group add 51 interface eth0 router 10.0.0.1 weight 30 assign hash priority 10 password - <<<secret
 for router in r1 r2; do lab_ctl $router password secret >/dev/null; done
 expect 1 '.error | test("there is a group 51")' group add 51
 lab_wait_role 30 a1 51 ACTIVE || fail "the group does not become active"
@@ -95,7 +96,7 @@ done
 lab_start a1 lines mgmtctl show --watch
 lab_start a1 terminal /usr/bin/env TERM=xterm LANG=C.UTF-8 script -qfec "stty rows 24 columns 80; exec $WCCP_BIN/mgmtctl show --watch" /dev/null
 lab_start a1 guest /usr/bin/env TERM=xterm LANG=C script -qfec "stty rows 12 columns 80; exec $WCCP_BIN/mgmtctl show --watch --below 5" /dev/null
-lab_wait_line 5 '^[0-9:]{8}  group 51  ACTIVE, designated  routers 2/2  share 25% of 25%' "$LAB/a1-lines.out" ||
+lab_wait_line 15 '^[0-9:]{8}  group 51  ACTIVE, designated  routers 2/2  share 25% of 25%' "$LAB/a1-lines.out" ||
     fail "no line for the group"
 lab_stop r2 router KILL 2>/dev/null
 lab_wait_line 30 '^[0-9:]{8}  alarm  group 51: a router is not connected' "$LAB/a1-lines.out" ||
@@ -103,7 +104,7 @@ lab_wait_line 30 '^[0-9:]{8}  alarm  group 51: a router is not connected' "$LAB/
 expect 0 '.alarms_total == 1 and .alarms[0].group == 51 and .alarms[0].name == "adjacency" and
     ([.groups[0].routers[] | select(.address == "10.0.0.2")][0].connection != "two-way")' show
 lab_stop a1 mgmtd KILL 2>/dev/null
-lab_wait_line 5 'mgmtd: ' "$LAB/a1-lines.out" || fail "the loss of mgmtd is not told"
+lab_wait_line 15 'mgmtd: ' "$LAB/a1-lines.out" || fail "the loss of mgmtd is not told"
 lab_wait_exit 15 a1 wccpd || fail "without mgmtd wccpd ended with $?"
 lab_mgmtd_start a1
 lab_wccpd_start a1
@@ -113,7 +114,7 @@ for name in terminal guest; do
     read -r script _ <<<"$(lab_pid a1 $name)"
     read -r live _ <"/proc/$script/task/$script/children"
     kill -INT "$live"
-    lab_wait_exit 5 a1 $name || fail "the live picture ($name) ended with $?"
+    lab_wait_exit 15 a1 $name || fail "the live picture ($name) ended with $?"
 done
 grep -aq $'^\033\\[?1049h' "$LAB/a1-terminal.out" && tail -c 40 "$LAB/a1-terminal.out" | grep -aqF $'\033[?25h\033[?1049l' ||
     fail "the terminal is not given back"
@@ -129,6 +130,8 @@ expect 0 '.done == "changed" and .state != null' group set 51 policy 5
 expect 0 '.groups[0].policy == 5' show
 expect 0 '.done == "deleted" and (.note | test(" 51"))' policy delete 5
 expect 4 '.code == 14004' policy delete 5
+expect 0 '.notes[0] | test("group restart 51")' set $GROUP/51/priority 20
+expect 0 '.done == "recreated" and .commits == 2 and .running' group restart 51
 expect 0 '.done == "recreated" and .running' group set 51 policy none
 expect 0 '.done == "deleted" and (.running | not)' group delete 51
 expect 0 '.groups_total == 0 and .alarms_total == 0' show
