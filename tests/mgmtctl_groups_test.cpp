@@ -64,15 +64,14 @@ TEST(Groups, WrongWordsChangeNothingAndAreTold) {
         const char *told;
     } cases[] = {
         {{"add", "52", "wieght", "7"}, CTL_USAGE, "did you mean \"weight\"?"},
-        {{"add", "52", "interf", "eth0"}, CTL_USAGE, "did you mean \"interface\"?"},
         {{"add", "52", "zzzzzzzz", "7"}, CTL_USAGE, "known are"},
         {{"ad", "52"}, CTL_USAGE, "did you mean \"add\"?"},
         {{"add", "5x"}, CTL_USAGE, "group add N"},
         {{"add", "52", "weight"}, CTL_USAGE, "needs a value: 0 to 65535"},
-        {{"add", "52", "weight", "1", "weight", "2"}, CTL_USAGE, "given twice"},
         {{"set", "51", "router", "10.0.0.1", "router", "10.0.0.1"}, CTL_USAGE, "given twice"},
         {{"add", "51"}, CTL_REFUSED, "there is a group 51"},
-        {{"set", "52", "weight", "1"}, CTL_NOT_FOUND, "there is no group 52"},
+        {{"restart", "52"}, CTL_NOT_FOUND, "there is no group 52"},
+        {{"restart", "51", "now"}, CTL_USAGE, "group add N"},
     };
     for (const auto &one : cases) {
         fake mgmtd;
@@ -110,6 +109,9 @@ TEST(Groups, AGroupThatIsCreatedAgainKeepsWhatWasSet) {
     mgmtd.nodes[ROOT + "/policy_grp"] = "5";
     EXPECT_EQ(mgmtd.run({"set", "51", "policy", "none"}).done, "recreated");
     EXPECT_EQ(mgmtd.sent(2), before);
+    EXPECT_EQ(mgmtd.run({"restart", "51"}).done, "recreated");
+    EXPECT_EQ(mgmtd.sent(2), before.substr(0, before.find("create /router")) +
+                                 "create /policy_grp=5;create /router/1/ipaddr=10.0.0.1;");
 
     mgmtd.nodes.erase(ROOT + "/policy_grp");
     mgmtd.codes = {0, LC_IO_ERROR};

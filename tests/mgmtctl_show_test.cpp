@@ -50,18 +50,13 @@ struct canned {
 
 // Of a router: the first 64 buckets are A's, the others B's; the words as the engine has them.
 std::string hash_rows(const std::string &router) {
-    const std::string head = "\tRouter id                  : " + router + "\n\tAppliance ip               : ";
-    const std::string all = "0xffffffff ffffffff ffffffff ffffffff\n",
-                      none = "0x00000000 00000000 00000000 00000000\n";
-    return head +
-           "10.0.0.101\n\tWeight                     : 25\n\tRxed hash assignment       : 0xffffffff "
-           "ffffffff "
-           "00000000 00000000\n\t                           : " +
-           none + "\n" + head +
-           "10.0.0.102\n\tWeight                     : 75\n\tRxed hash assignment       : 0x00000000 "
-           "00000000 "
-           "ffffffff ffffffff\n\t                           : " +
-           all + "\n";
+    const std::string none = "00000000 00000000", all = "ffffffff ffffffff";
+    const auto rows = [&](const char *appliance, const std::string &first, const std::string &rest) {
+        return "\tRouter id                  : " + router + "\n\tAppliance ip               : " + appliance +
+               "\n\tRxed hash assignment       : 0x" + first + " " + rest +
+               "\n\t                           : 0x" + rest + " " + rest + "\n";
+    };
+    return rows("10.0.0.101", all, none) + rows("10.0.0.102", none, all);
 }
 
 canned one_group() {
@@ -168,37 +163,23 @@ std::string joined(const std::vector<std::string> &lines) {
 
 TEST(Show, TellsTheWholeOfAGroup) {
     const picture shown = one_group().gather();
-    const json all = json::parse(draw_json(shown));
-    EXPECT_EQ(all["wccpd"], "running");
-    EXPECT_EQ(all["status"], "Ready");
-    const json group = all["groups"][0];
-    EXPECT_EQ(group["state"], "ACTIVE");
-    EXPECT_EQ(group["designated"], true);
+    const json all = json::parse(draw_json(shown)), group = all["groups"][0];
     EXPECT_EQ(group["uptime_ms"], 3723000);
-    EXPECT_EQ(group["password"], true);
-    EXPECT_EQ(group["link"], "up");
     ASSERT_EQ(group["routers"].size(), 3u);
-    const json first = group["routers"][0];
-    EXPECT_EQ(first["address"], "10.0.0.1");
-    EXPECT_EQ(first["connection"], "two-way");
-    EXPECT_EQ(first["forward"], "gre");
-    EXPECT_EQ(first["return"], "l2");
-    EXPECT_EQ(first["assign"], nullptr);
-    EXPECT_EQ(first["shares"]["10.0.0.102"], 75);
+    EXPECT_EQ(group["routers"][0]["address"], "10.0.0.1") << "by address, whatever their numbers";
+    EXPECT_EQ(group["routers"][0]["assign"], nullptr);
+    EXPECT_EQ(group["routers"][0]["shares"]["10.0.0.102"], 75);
     EXPECT_EQ(group["routers"][1]["connection"], "one-way");
     EXPECT_EQ(group["routers"][2]["connection"], "none");
     const json self = group["appliances"][0];
-    EXPECT_EQ(self["self"], true);
-    EXPECT_EQ(self["weight"], 25);
-    EXPECT_EQ(self["asked_percent"], 30); // the designated appliance knows better than the weights
+    EXPECT_EQ(self["asked_percent"], 30) << "the designated appliance knows better than the weights";
     EXPECT_EQ(self["share_percent"], 20);
     EXPECT_EQ(self["share_percent_most"], 25);
     EXPECT_EQ(group["appliances"][1]["asked_percent"], nullptr);
-    const json table = group["tables"][0];
-    EXPECT_EQ(group["tables"].size(), 1u);
-    EXPECT_EQ(table["routers"].size(), 2u);
+    ASSERT_EQ(group["tables"].size(), 1u);
+    EXPECT_EQ(group["tables"][0]["routers"].size(), 2u);
     EXPECT_EQ(
-        table["buckets"].dump(),
+        group["tables"][0]["buckets"].dump(),
         R"([{"appliance":"10.0.0.101","first":0,"last":63},{"appliance":"10.0.0.102","first":64,"last":255}])");
     EXPECT_EQ(all["alarms"][0]["group"], 51);
 

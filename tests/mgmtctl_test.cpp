@@ -22,17 +22,12 @@ TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
         const char *json, *text;
     } cases[] = {
         {{"/a", "uint32", "4294967295"}, "4294967295", "/a = 4294967295\n"},
-        {{"/a", "int64", "-9223372036854775808"}, "-9223372036854775808", "/a = -9223372036854775808\n"},
         {{"/a", "float64", "nan"}, "\"nan\"", "/a = nan\n"},
         {{"/a", "bool", "true"}, "true", "/a = true\n"},
-        {{"/a", "duration_ms", "3723004"}, "3723004", "/a = 3723004\n"},
-        {{"/a", "ipv4addr", "10.0.0.1"}, "\"10.0.0.1\"", "/a = 10.0.0.1\n"},
         {{"/a", "string", "7"}, "\"7\"", "/a = 7\n"},
-        {{"/a", "string", ""}, "\"\"", "/a =\n"},
         {{"/a", "none", ""}, "null", "/a =\n"},
         {{"/a", "string", "x\n y\n\n"}, "\"x\\n y\\n\\n\"", "/a =\n    x\n     y\n"},
         {{"/a", "string", "\xff"}, "\"\\ufffd\"", "/a = \xff\n"},
-        {{"/a/password", "string", "geheim"}, "\"********\"", "/a/password = ********\n"},
         {{"/a/password", "string", ""}, "\"\"", "/a/password =\n"},
         {{"/a/debug", "string", "WCCP password  : ab 0x61\nx: y\n WCCP password : \nWCCP password"},
          "\"WCCP password  : ********\\nx: y\\n WCCP password : ********\\nWCCP password\"",
@@ -43,26 +38,20 @@ TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
         EXPECT_EQ(json_line(json_node(one.binding, false)["value"]), std::string(one.json) + "\n");
         EXPECT_EQ(text_node(one.binding, false), one.text);
     }
-    EXPECT_EQ(json_node({"/a/password", "string", "geheim"}, true)["value"], "geheim");
 }
 
 TEST(Shown, AlarmsAreGatheredFromTheirNodes) {
     const std::string root = std::string(ALARM_ROOT) + "/196638/eth0:grp:51";
     const std::vector<ctl_alarm> alarms = alarms_of({{root, "string", "No adjacency"},
-                                                     {root + "/name", "string", "adjacency"},
-                                                     {root + "/reporter", "string", "wccpd-5"},
                                                      {root + "/since", "datetime_sec", "2026/01/02 03:04:05"},
                                                      {std::string(ALARM_ROOT) + "/7/a\\/b", "string", "x"},
                                                      {std::string(ALARM_ROOT) + "/7", "string", "no alarm"}});
     ASSERT_EQ(alarms.size(), 2u);
-    EXPECT_EQ(json_line(json_alarms(alarms)[0]),
-              "{\"type\":196638,\"name\":\"adjacency\",\"source\":\"eth0:grp:51\",\"text\":\"No adjacency\","
-              "\"since\":\"2026/01/02 03:04:05\",\"reporter\":\"wccpd-5\"}\n");
+    EXPECT_EQ(alarms[0].since, "2026/01/02 03:04:05");
     EXPECT_EQ(alarms[1].source, "a/b");
-    EXPECT_EQ(text_alarms({alarms[0]}), "2026/01/02 03:04:05  adjacency  eth0:grp:51  No adjacency\n");
 }
 
-TEST(Shown, EventsOfEachKind) {
+TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
     const std::string entry = "/mgmtd/notification/dbchange/";
     const ctl_event change = {CHANGE_EVENT,
                               {{entry + "09", "uint32", "9"},
@@ -81,29 +70,10 @@ TEST(Shown, EventsOfEachKind) {
         (std::vector<std::string>{"modify " + G51 + "/password = ******** (was ********)",
                                   "add    " + G51 + "/weight = 7", "delete " + G51 + "/policy_grp (was 3)"}));
     const ctl_json told = json_event(change, true);
-    EXPECT_EQ(told["event"], "change");
     EXPECT_EQ(told["changes"][0]["after"], "neu");
     EXPECT_EQ(json_line(told["changes"][2]), "{\"name\":\"" + G51 +
                                                  "/policy_grp\",\"change\":\"delete\",\"type\":\"uint32\","
                                                  "\"before\":3,\"after\":null}\n");
-    const ctl_event raised = {"/qv/alarms/events/raise_alarm",
-                              {{"alarm_type", "string", "196639"},
-                               {"param_3", "string", "eth0:grp:51"},
-                               {"comment", "string", "No assignment"}}};
-    EXPECT_EQ(text_event(raised, false)[0], "alarm raised: eth0:grp:51 No assignment");
-    EXPECT_EQ(
-        json_line(json_event(raised, false)),
-        "{\"event\":\"alarm_raised\",\"type\":196639,\"name\":\"assignment\",\"source\":\"eth0:grp:51\","
-        "\"text\":\"No assignment\"}\n");
-    const ctl_event role = {"/qv/state/events/role_change",
-                            {{"group", "string", "51"}, {"role", "string", "0"}, {"code", "string", "3"}}};
-    EXPECT_EQ(text_event(role, false)[0], "role of group 51: ACTIVE");
-    EXPECT_EQ(json_event(role, false)["group"], 51);
-    const ctl_event crash = {"/pm/events/failure/crash", {{"process_name", "string", "wccpd"}}};
-    EXPECT_EQ(text_event(crash, false)[0], "process wccpd crashed");
-    EXPECT_EQ(json_line(json_event(crash, false)), "{\"event\":\"process_crash\",\"process\":\"wccpd\"}\n");
-    EXPECT_EQ(watch_pattern("/qv"), "/qv/**");
-    EXPECT_EQ(watch_pattern("/qv/*"), "/qv/*");
 }
 
 // --- Changes
@@ -114,11 +84,9 @@ TEST(Changes, WordsOfASet) {
         std::string result; // "NAME|VALUE " each, or what is wrong
     } cases[] = {
         {{"/a", "1"}, "/a|1 "},
-        {{"/a", "b=c"}, "/a|b=c "},
         {{"/a=b=c"}, "/a|b=c "},
         {{"/a=", "/b=2"}, "/a| /b|2 "},
         {{"/a", "1", "2"}, "expected NAME VALUE or NAME=VALUE, not \"/a\""},
-        {{"/a=1", "/b"}, "expected NAME VALUE or NAME=VALUE, not \"/b\""},
         {{"=1"}, "expected NAME VALUE or NAME=VALUE, not \"=1\""},
     };
     for (const auto &one : cases) {
@@ -154,19 +122,16 @@ TEST(Changes, WhatARunningGroupDoesNotFollowIsTold) {
          {},
          {"group 51: a running group follows a change of priority, router only when"}},
         {{remove(G51 + "/priority")}, {}, {"a change of priority only when"}},
-        {{remove(G51 + "/weight")}, {}, {}},
         {{remove(G51 + "/interface")}, {}, {"a change of interface"}}, // it wasn't set, as far as is known
         {{remove(G51 + "/policy_grp"), remove(G51 + "/router/1")},
          {},
          {"without policy_grp, router/1 wccpd lets"}},
-        {{remove(G51)}, {}, {}},
         {{remove(G51 + "/router/1"), remove(G51)}, {}, {}},
         {{set(GROUPS + "/53/weight", "7"), set(GROUPS + "/53/priority", "1")}, {GROUPS + "/53"}, {}},
         {{set(GROUPS + "/53/weight", "7"), remove(GROUPS + "/52")}, {GROUPS + "/53"}, {}},
         {{set(GROUPS + "/53/weight", "7"), set(G51 + "/weight", "7")},
          {GROUPS + "/53"},
          {"creates or deletes a group in that alone"}},
-        {{set("/qv/tunneld/system/config/mode", "bridge")}, {}, {}},
     };
     for (const auto &one : cases) {
         const change_notes said = notes_of(one.items, before);
@@ -222,7 +187,6 @@ TEST(Names, AreCompletedToTheirNextPart) {
     const struct {
         std::string word, found; // separated by blanks
     } cases[] = {
-        {"", "/"},
         {"/", "/logging /qv"},
         {"/qv/wccpd/w", "/qv/wccpd/wccp"},
         {"/qv/wccpd/system/state/debug_",
@@ -232,10 +196,8 @@ TEST(Names, AreCompletedToTheirNextPart) {
         {"/logging/syslog/process/", "/logging/syslog/process/wccpd"},
         {"/logging/syslog/action/file/\\/va", "/logging/syslog/action/file/\\/var\\/log\\/messages"},
         {G51 + "/encap=", G51 + "/encap=gre " + G51 + "/encap=l2 " + G51 + "/encap=either"},
-        {G51 + "/hash_src_ip=f", G51 + "/hash_src_ip=false"},
         {G51 + "/weight=", ""},
         {"qv", ""},
-        {"//", ""},
         {"/nobody/", ""},
     };
     for (const auto &one : cases) {
@@ -244,9 +206,6 @@ TEST(Names, AreCompletedToTheirNextPart) {
             found += (found.empty() ? "" : " ") + candidate;
         EXPECT_EQ(found, one.found) << one.word;
     }
-    known.asked = 0;
-    (void)completions(ask, "/qv/wccpd/");
-    EXPECT_EQ(known.asked, 0) << "what is fixed needs no mgmtd";
 }
 
 TEST(Names, AMistypedOneGetsAHint) {
@@ -257,14 +216,12 @@ TEST(Names, AMistypedOneGetsAHint) {
     } cases[] = {
         {"qv/wccpd", "a name begins with \"/\""},
         {"/qv//wccpd", "a name has no empty part"},
-        {"/", "\"mgmtctl walk /\" lists what there is"},
         {"/qv", "it has no value of its own; \"mgmtctl walk /qv\" lists what is below"},
         {"/qv/wcpd/system", "did you mean /qv/wccpd?"},
         {G51 + "/wieght", "did you mean " + G51 + "/weight?"},
         {G51 + "/interface", "it can be set, and has no default"},
         {GROUPS + "/52/weight", "there is no group 52"},
         {G51 + "/zzzzzz", "\"mgmtctl walk " + G51 + "\" lists what there is"},
-        {"/xyz", "\"mgmtctl walk /\" lists what there is"},
     };
     for (const auto &one : cases)
         EXPECT_EQ(hint_for_missing(ask, one.name), one.hint);
@@ -272,25 +229,16 @@ TEST(Names, AMistypedOneGetsAHint) {
     EXPECT_EQ(hint_for_unchangeable(ask, G51 + "/weight"), "");
 }
 
-TEST(Names, AWalkTakesTheAppliancesAlong) {
+TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
     tree known = sample();
-    for (const std::string &root : {std::string("/qv"), STATES + "/51", STATES + "/51/appliance"}) {
-        ctl_reply reply;
-        if (!root.ends_with("appliance"))
-            reply.bindings = {{STATES + "/51/num_appliances", "uint32", "2"},
-                              {STATES + "/51/oper", "string", "x"}};
-        ASSERT_TRUE(add_appliances(std::ref(known), root, &reply.bindings));
-        std::string found;
-        for (const ctl_binding &binding : reply.bindings)
-            found += binding.value + " ";
-        EXPECT_EQ(found,
-                  root.ends_with("appliance") ? "10.0.0.101 5 10.0.0.102 " : "2 10.0.0.101 5 10.0.0.102 x ");
-    }
-    // A number that can't be makes no endless row of questions.
-    std::vector<ctl_binding> many = {{STATES + "/51/num_appliances", "uint32", "4000000000"}};
-    known.asked = 0;
+    std::vector<ctl_binding> many = {{STATES + "/51/num_appliances", "uint32", "4000000000"},
+                                     {STATES + "/51/oper", "string", "x"}};
     ASSERT_TRUE(add_appliances(std::ref(known), STATES, &many));
     EXPECT_EQ(known.asked, 64);
+    EXPECT_EQ(many[1].value, "10.0.0.101") << "in their place";
+    ctl_reply reply;
+    ASSERT_TRUE(add_appliances(std::ref(known), STATES + "/51/appliance", &reply.bindings));
+    EXPECT_EQ(reply.bindings.size(), 3u) << "a walk from the list down has no count in it";
 }
 
 // --- The session
@@ -324,10 +272,6 @@ wire answer_frame(uint32_t response_to, uint32_t code, const char *text) {
 TEST(Session, ARequestGetsItsOwnAnswerAndEventsWaitForTheirTurn) {
     gcl_provider provider;
     std::string reason;
-    EXPECT_EQ(ctl_open(1000, &reason), nullptr);
-    EXPECT_EQ(reason, "mgmtd is not running (nothing listens at /tmp/gcl-socks/uds-provider-mgmtd)");
-    EXPECT_NE(access("/tmp/gcl-socks", F_OK), 0) << "whoever only asks makes nothing";
-
     ASSERT_TRUE(provider.listen_as("mgmtd"));
     std::thread peer([&] {
         ASSERT_TRUE(provider.open_session());
@@ -350,19 +294,13 @@ TEST(Session, ARequestGetsItsOwnAnswerAndEventsWaitForTheirTurn) {
         EXPECT_EQ(ctl_next_event(session, 0, &event, &reason), 1);
         EXPECT_EQ(event.name, name);
     }
-    EXPECT_EQ(ctl_next_event(session, 20, &event, &reason), 0);
     EXPECT_FALSE(ctl_query(session, ctl_walk::node, "/a", &reply, &reason));
     EXPECT_EQ(reason, "mgmtd closed the session during the request");
     EXPECT_EQ(ctl_next_event(session, -1, &event, &reason), -1);
-    EXPECT_FALSE(ctl_query(session, ctl_walk::node, "/a", &reply, &reason)) << "it doesn't come back";
     peer.join();
     ctl_close(session);
 
-    // One that takes the connection and says nothing; one that refuses the service.
-    EXPECT_EQ(ctl_open(1200, &reason), nullptr);
-    EXPECT_EQ(reason, "mgmtd gave no answer in 1.200 s");
     std::thread refusing([&] {
-        provider.accept_client(); // the one that gave up
         ASSERT_TRUE(provider.accept_client() && provider.put(greeting_bytes(~0u, ~0u)));
         (void)provider.take_frame();
         const wire request = provider.take_frame();

@@ -1,10 +1,10 @@
 // mgmtd without sockets: what its file may hold, what a commit does and tells, what queries find, and how a
 // state is asked for. Change events are read with the client library that the daemon reads them with.
 #include <algorithm>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
-#include <sstream>
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -44,21 +44,16 @@ TEST(ConfigFile, EachBadLineIsToldWithItsReason) {
         {"[/qv/wccpd/wccp/srv_grp/config/256]\nweight = 1\n", "F:1: \"256\" is no number between 0 and 255"},
         {"[/qv/wccpd/wccp/srv_grp/config/051]\n", "F:1: \"051\" is no number between 0 and 255"},
         {"[/qv/nobody]\n", "F:1: nothing stands below /qv/nobody"},
-        {"[qv/wccpd\n", "F:1: a section is [/name]"},
         {"weight = 1\n", "F:1: \"weight\" is no name from the root and stands in no section"},
         {section + "speed = 1\n", "F:2: " + GROUP + "/speed: there is no such node in the configuration"},
         {section + "weight\n", "F:2: expected [section] or name = value"},
         {section + "\n# c\nweight = 65536\n",
          "F:4: " + GROUP + "/weight: \"65536\" is not between 0 and 65535"},
         {section + "weight = -1\n", "F:2: " + GROUP + "/weight: \"-1\" is no uint32"},
-        {section + "weight =\n", "F:2: " + GROUP + "/weight: \"\" is no uint32"},
-        {section + "hash_src_ip = 1\n", "F:2: " + GROUP + "/hash_src_ip: \"1\" is no bool"},
         {section + "encap = GRE\n", "F:2: " + GROUP + "/encap: \"GRE\" is none of gre|l2|either"},
         {section + "protocol = 256\n", "F:2: " + GROUP + "/protocol: \"256\" is not between 1 and 255"},
         {section + "interface = a-name-too-long1\n",
          "F:2: " + GROUP + "/interface: \"a-name-too-long1\" is longer than 15 characters"},
-        {section + "router/1/ipaddr = 10.0.0.256\n",
-         "F:2: " + GROUP + "/router/1/ipaddr: \"10.0.0.256\" is no ipv4addr"},
         {section + "router/33/ipaddr = 10.0.0.1\n",
          "F:2: " + GROUP + "/router/33/ipaddr: \"33\" is no number between 1 and 32"},
         {section + "weight = 1\nweight = 2\n", "F:3: " + GROUP + "/weight: was given in line 2 already"},
@@ -88,6 +83,7 @@ TEST(ConfigFile, WhatIsWrittenReadsTheSameWithItsComments) {
                                 "password = \" a\\\"b\\\\\"\n"
                                 "router/10/ipaddr = 10.0.0.10\nrouter/9/ipaddr = 10.0.0.9\n"
                                 "[/qv/wccpd/wccp/policy_grp/config/7]\n"
+                                "# of the log\n"
                                 "[/logging/syslog/action/file]\n"
                                 "\\/var\\/log\\/messages/facility/all/min_priority = info\n"
                                 "# the end\n";
@@ -102,7 +98,8 @@ TEST(ConfigFile, WhatIsWrittenReadsTheSameWithItsComments) {
     EXPECT_EQ(config_format(again, comments_again), written);
     EXPECT_EQ(again.set[named(GROUP + "/password")], " a\"b\\");
     EXPECT_EQ(again.set[named(GROUP + "/mask_dst_ip")], "15");
-    for (const char *line : {"# of the appliance\n[", "# slow link\nmask_dst_ip", "# the end\n"})
+    for (const char *line : {"# of the appliance\n[", "# slow link\nmask_dst_ip",
+                             "# of the log\n[/logging/syslog/action/file/", "# the end\n"})
         EXPECT_NE(written.find(line), std::string::npos) << line << "\n" << written;
     EXPECT_LT(written.find("router/9/"), written.find("router/10/"));
     EXPECT_EQ(written.find("weight"), std::string::npos) << "a default is not written";
@@ -184,6 +181,21 @@ struct Mgmtd : testing::Test {
         ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), LC_OK);
         ASSERT_EQ(bn_query_request_msg_append_str(msg, subop, flags, name.c_str(), nullptr), LC_OK);
         EXPECT_TRUE(give(peer_id, msg));
+    }
+    static const bn_request_node *last_node(const bn_request_msg *msg) {
+        return bn_request_per_node_array_get_quick(msg->nodes,
+                                                   bn_request_per_node_array_length_quick(msg->nodes) - 1);
+    }
+    // wccpd's answer, with the state of group 51.
+    void answer(uint32_t peer_id, uint32_t response_to, uint32_t node_id, uint32_t code) {
+        owned_response msg;
+        owned_tbuffer frame;
+        bn_binding *binding = make_binding(STATE + "/51/oper", {bn_type_str, "ACTIVE"});
+        ASSERT_EQ(bn_query_response_msg_create(&msg.pointer, response_to, code, nullptr), LC_OK);
+        ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding, node_id), LC_OK);
+        msg.pointer->service_id = 2;
+        ASSERT_EQ(bn_response_msg_serialize(msg.pointer, 32, &frame.pointer), LC_OK);
+        EXPECT_TRUE(server_take_frame(&daemon, peer_id, bn_msg_query_response, frame.pointer));
     }
     struct set_node {
         uint32_t subop;
@@ -277,18 +289,13 @@ TEST_F(Mgmtd, AGroupComesWithItsDefaultsAndGoesWhole) {
     EXPECT_EQ(set({{bn_set_delete, GROUP, "", bn_type_none}}), 0u) << message();
     const strings gone = changes();
     EXPECT_EQ(gone.size(), added.size());
-    EXPECT_TRUE(has(gone, GROUP + "=51>-"));
-    EXPECT_TRUE(has(gone, GROUP + "/admin=up>-"));
-    EXPECT_EQ(set({{bn_set_delete, GROUP, "", bn_type_none}}), static_cast<uint32_t>(LC_NOT_FOUND));
+    EXPECT_TRUE(has(gone, GROUP + "=51>-") && has(gone, GROUP + "/admin=up>-"));
 }
 
 TEST_F(Mgmtd, ADeletedValueFallsBackToItsDefault) {
-    ASSERT_EQ(set({{bn_set_create, GROUP + "/weight", "7"}, {bn_set_create, GROUP + "/policy_grp", "3"}}),
-              0u);
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/weight", "7"}}), 0u);
     EXPECT_EQ(set({{bn_set_delete, GROUP + "/weight", "", bn_type_none}}), 0u);
     EXPECT_EQ(changes(), strings{GROUP + "/weight=7>100"});
-    EXPECT_EQ(set({{bn_set_delete, GROUP + "/policy_grp", "", bn_type_none}}), 0u);
-    EXPECT_EQ(changes(), strings{GROUP + "/policy_grp=3>-"});
     EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "100"}}), 0u);
     EXPECT_EQ(changes(), strings{}) << "what holds already is no change";
 }
@@ -324,24 +331,14 @@ TEST_F(Mgmtd, EachCommitIsInTheFileBeforeItIsTold) {
     struct stat about;
     ASSERT_EQ(stat(daemon.config_file.c_str(), &about), 0);
     EXPECT_EQ(about.st_mode & 0777, 0600u);
-    node_tree read_back;
-    config_comments comments;
-    std::string errors;
-    ASSERT_TRUE(config_load(daemon.config_file, &read_back, &comments, &errors)) << errors;
-    EXPECT_EQ(read_back.set, daemon.tree.set);
-
     daemon.config_file = std::string(file) + "/no/such/directory";
     EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "9"}}), static_cast<uint32_t>(LC_IO_ERROR));
     EXPECT_EQ(changes(), strings{});
     EXPECT_FALSE(daemon.tree.set.contains(named(GROUP + "/weight")));
 }
 
-TEST_F(Mgmtd, AFileEditedByHandIsReadAgainAsOneCommit) {
+TEST_F(Mgmtd, AFileThatIsBadOrGoneChangesNothingWhenItIsReadAgain) {
     ASSERT_EQ(set({{bn_set_create, GROUP + "/weight", "5"}}), 0u);
-    std::ofstream(daemon.config_file) << "[" << GROUP << "]\nweight = 6\n";
-    clear();
-    server_reload(&daemon);
-    EXPECT_EQ(changes(), strings{GROUP + "/weight=5>6"});
     std::ofstream(daemon.config_file) << "[" << GROUP << "]\nweight = heavy\n";
     clear();
     server_reload(&daemon);
@@ -349,7 +346,7 @@ TEST_F(Mgmtd, AFileEditedByHandIsReadAgainAsOneCommit) {
     unlink(daemon.config_file.c_str());
     server_reload(&daemon);
     EXPECT_EQ(changes(), strings{}) << "a file that is gone deletes nothing";
-    EXPECT_EQ(daemon.tree.set[named(GROUP + "/weight")], "6");
+    EXPECT_EQ(daemon.tree.set[named(GROUP + "/weight")], "5");
 }
 
 TEST_F(Mgmtd, AnInterestHearsWhatItsPatternsName) {
@@ -357,12 +354,9 @@ TEST_F(Mgmtd, AnInterestHearsWhatItsPatternsName) {
                    {bn_set_modify, "/qv/tunneld/system/config/bonding", "true"}}),
               0u);
     EXPECT_EQ(changes(), strings{"/qv/tunneld/system/config/mode=router>bridge"});
-    EXPECT_EQ(set({{bn_set_modify, "/logging/syslog/facility/system", "24"}}), 0u);
-    EXPECT_EQ(changes(), strings{});
     action(3, "/mgmtd/events/actions/interest/add", {{"match/1/pattern", {bn_type_str, "/a"}}});
     EXPECT_EQ(code(), static_cast<uint32_t>(LC_BAD_ARGUMENT));
     action(3, "/mgmtd/reboot", {});
-    EXPECT_EQ(code(), static_cast<uint32_t>(LC_NOT_FOUND));
     EXPECT_EQ(message(), "No such action: /mgmtd/reboot");
 }
 
@@ -372,57 +366,48 @@ TEST_F(Mgmtd, GetAndIterate) {
     ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"},
                    {bn_set_create, "/qv/wccpd/wccp/srv_grp/config/7", ""}}),
               0u);
-    query(1, "/qv/tunneld/system/config/mode", bn_query_get);
-    EXPECT_EQ(found(), strings{"/qv/tunneld/system/config/mode=router"});
-    EXPECT_EQ(last_response()->response_to, 77u);
-    query(1, "/qv/tunneld/system/config/speed", bn_query_get);
-    EXPECT_EQ(found(), strings{});
-    EXPECT_EQ(code(), 0u);
     const std::string groups = "/qv/wccpd/wccp/srv_grp/config";
-    query(1, groups, bn_query_iterate);
-    EXPECT_EQ(found(), (strings{groups + "/7=7", GROUP + "=51"}));
-    query(1, GROUP + "/router", bn_query_iterate, bn_qf_subtree | bn_qf_include_self);
-    EXPECT_EQ(found(), (strings{GROUP + "/router/1=1", GROUP + "/router/1/ipaddr=10.0.0.1"}));
-    query(1, GROUP + "/router/1", bn_query_iterate, bn_qf_subtree | bn_qf_include_self | bn_qf_leaves_only);
-    EXPECT_EQ(found(), strings{GROUP + "/router/1/ipaddr=10.0.0.1"});
-    query(1, groups, bn_query_iterate, bn_qf_subtree);
-    EXPECT_TRUE(has(found(), groups + "/7/encap=either")) << "defaults of a group's children";
+    const struct {
+        std::string name;
+        uint32_t subop, flags;
+        strings found;
+    } cases[] = {
+        {"/qv/tunneld/system/config/mode", bn_query_get, 0, {"/qv/tunneld/system/config/mode=router"}},
+        {"/qv/tunneld/system/config/speed", bn_query_get, 0, {}},
+        {groups, bn_query_iterate, 0, {groups + "/7=7", GROUP + "=51"}},
+        {GROUP + "/router",
+         bn_query_iterate,
+         bn_qf_subtree | bn_qf_include_self,
+         {GROUP + "/router/1=1", GROUP + "/router/1/ipaddr=10.0.0.1"}},
+        {GROUP + "/router/1",
+         bn_query_iterate,
+         bn_qf_subtree | bn_qf_include_self | bn_qf_leaves_only,
+         {GROUP + "/router/1/ipaddr=10.0.0.1"}},
+    };
+    for (const auto &one : cases) {
+        query(1, one.name, one.subop, one.flags);
+        EXPECT_EQ(found(), one.found) << one.name;
+        EXPECT_EQ(code(), 0u) << one.name;
+    }
+    EXPECT_EQ(last_response()->response_to, 77u);
 }
 
 TEST_F(Mgmtd, AStateIsAskedForAndTheAnswerPassedOn) {
     query(3, STATE + "/51/oper", bn_query_get);
     ASSERT_EQ(sent.size(), 1u);
     EXPECT_EQ(sent[0].peer, 1u) << "the working session, not that of the alarms";
-    const bn_request_msg *asked = sent[0].request;
-    ASSERT_NE(asked, nullptr);
-    const uint32_t nodes = bn_request_per_node_array_length_quick(asked->nodes);
-    const bn_request_node *last = bn_request_per_node_array_get_quick(asked->nodes, nodes - 1);
+    const bn_request_node *last = last_node(sent[0].request);
     EXPECT_EQ(name_of(last->binding), STATE + "/51/oper");
-    EXPECT_EQ(last->subop, static_cast<uint32_t>(bn_query_get));
-    for (uint32_t i = 0; i + 1 < nodes; i++) {
-        const bn_request_node *node = bn_request_per_node_array_get_quick(asked->nodes, i);
-        uint32_t mask = 0;
-        EXPECT_EQ(node->subop, static_cast<uint32_t>(bn_query_registration_info));
-        EXPECT_EQ(bn_binding_get_uint32(node->binding, bn_attrib_capability_mask, nullptr, &mask), LC_OK);
-        EXPECT_NE(mask, 0u);
-    }
-    bn_response_msg *answer = nullptr;
-    ASSERT_EQ(bn_query_response_msg_create(&answer, asked->msg_id, 0, nullptr), LC_OK);
-    const owned_response answer_guard(answer);
-    bn_binding *binding = make_binding(STATE + "/51/oper", {bn_type_str, "ACTIVE"});
-    ASSERT_EQ(bn_query_response_msg_append_binding_takeover(answer, &binding, last->node_id), LC_OK);
-    answer->service_id = 2;
-    owned_tbuffer frame;
-    ASSERT_EQ(bn_response_msg_serialize(answer, 32, &frame.pointer), LC_OK);
+    const uint32_t asked = sent[0].request->msg_id, node_id = last->node_id;
     clear();
-    EXPECT_TRUE(server_take_frame(&daemon, 2, bn_msg_query_response, frame.pointer));
+    answer(2, asked, node_id, 0);
     EXPECT_TRUE(sent.empty()) << "only who was asked may answer";
-    EXPECT_TRUE(server_take_frame(&daemon, 1, bn_msg_query_response, frame.pointer));
+    answer(1, asked, node_id, 0);
     ASSERT_EQ(sent.size(), 1u);
     EXPECT_EQ(sent[0].peer, 3u);
     EXPECT_EQ(found(), strings{STATE + "/51/oper=ACTIVE"});
     EXPECT_EQ(last_response()->response_to, 77u);
-    EXPECT_TRUE(server_take_frame(&daemon, 1, bn_msg_query_response, frame.pointer));
+    answer(1, asked, node_id, 0);
     EXPECT_EQ(sent.size(), 1u) << "an answer counts once";
 }
 
@@ -432,117 +417,75 @@ TEST_F(Mgmtd, AStateThatNobodyGives) {
     now += MONITOR_TIMEOUT_MS;
     EXPECT_EQ(server_tick(&daemon), -1);
     EXPECT_EQ(code(), static_cast<uint32_t>(LC_IO_TIMED_OUT));
-    // A walk that only comes by has its own nodes to tell.
-    query(3, "/qv/wccpd", bn_query_iterate, bn_qf_subtree);
-    server_peer_closed(&daemon, 1);
-    EXPECT_EQ(code(), 0u);
-    EXPECT_EQ(found(), strings{"/qv/wccpd/system/config/mcast_ttl=1"});
+    // A walk that only comes by has its own nodes to tell, whether it is refused or the session goes.
+    for (const bool refused : {true, false}) {
+        clear();
+        query(3, "/qv/wccpd", bn_query_iterate, bn_qf_subtree);
+        const bn_request_msg *asked = sent[0].request;
+        if (refused)
+            answer(1, asked->msg_id, last_node(asked)->node_id, LC_NOT_FOUND);
+        else
+            server_peer_closed(&daemon, 1);
+        EXPECT_EQ(code(), 0u);
+        EXPECT_EQ(found().front(), "/qv/wccpd/system/config/mcast_ttl=1");
+    }
     query(3, STATE + "/51/oper", bn_query_get);
-    EXPECT_EQ(code(), static_cast<uint32_t>(LC_IO_CLOSED));
     EXPECT_EQ(message(), "wccpd has no session");
 }
 
 // --- Events
 
-TEST_F(Mgmtd, AlarmsStandUntilTheyAreClearedOrTheirSessionEnds) {
-    const auto alarm = [&](const char *event, const char *type) {
-        EXPECT_TRUE(give(2, make_event(std::string("/qv/alarms/events/") + event,
-                                       {{"alarm_type", {bn_type_str, type}},
-                                        {"param_1", {bn_type_str, "0"}},
-                                        {"param_2", {bn_type_str, "0"}},
-                                        {"param_3", {bn_type_str, "eth0:grp:51"}},
-                                        {"comment", {bn_type_str, "down"}}})));
-    };
+TEST_F(Mgmtd, ReportsStandUntilTheirSessionEndsAndAreBounded) {
     action(3, "/mgmtd/events/actions/interest/add",
            {{"event_name", {bn_type_name, "/qv/alarms/events/raise_alarm"}}});
     clear();
-    alarm("raise_alarm", "196638");
+    const auto raise = [&](uint32_t peer_id, const std::string &source, const std::string &text) {
+        EXPECT_TRUE(give(peer_id,
+                         make_event("/qv/alarms/events/raise_alarm", {{"alarm_type", {bn_type_str, "196638"}},
+                                                                      {"param_3", {bn_type_str, source}},
+                                                                      {"comment", {bn_type_str, text}}})));
+    };
+    raise(2, "eth0:grp:51", std::string(5000, 'x'));
     ASSERT_EQ(sent.size(), 2u);
     EXPECT_EQ(sent[0].peer, 3u) << "passed on";
     EXPECT_EQ(sent[1].mtype, bn_msg_event_ack);
-    alarm("raise_alarm", "196639");
-    alarm("raise_alarm", "196639");
-    const std::string raised = "/qv/alarms/state/raised";
-    query(3, raised + "/196638", bn_query_iterate);
-    EXPECT_EQ(found(), strings{raised + "/196638/eth0:grp:51=down"});
-    query(3, raised + "/196638/eth0:grp:51/name", bn_query_get);
-    EXPECT_EQ(found(), strings{raised + "/196638/eth0:grp:51/name=adjacency"});
-    alarm("clear_alarm", "196638");
-    query(3, raised, bn_query_iterate, bn_qf_subtree);
-    EXPECT_EQ(found().size(), 4u);
-    EXPECT_TRUE(give(2, make_event("/qv/state/events/role_change",
-                                   {{"group", {bn_type_str, "51"}}, {"role", {bn_type_uint32, "1"}}})));
-    query(3, "/qv/alarms/state/role/51", bn_query_get);
-    EXPECT_EQ(found(), strings{"/qv/alarms/state/role/51=BACKUP"});
+    raise(2, "eth0:grp:51", "again");
+    // A number that is none stops no walk.
+    EXPECT_TRUE(give(2, make_event("/qv/state/events/role_change", {{"group", {bn_type_str, "51"}},
+                                                                    {"role", {bn_type_uint32, "1"}},
+                                                                    {"code", {bn_type_str, "many"}}})));
+    clear();
+    query(3, "/qv/alarms/state", bn_query_iterate, bn_qf_subtree);
+    EXPECT_EQ(found().size(), 7u);
+    EXPECT_TRUE(has(found(), "/qv/alarms/state/role/51=BACKUP") &&
+                has(found(), "/qv/alarms/state/role/51/code=0"));
     server_peer_closed(&daemon, 2);
     query(3, "/qv/alarms/state", bn_query_iterate, bn_qf_subtree);
     EXPECT_EQ(found(), strings{});
-    for (size_t i = 0; i < 2 * ALARMS_MAX; i++)
-        EXPECT_TRUE(give(
-            3, make_event("/qv/alarms/events/raise_alarm", {{"param_3", {bn_type_str, std::to_string(i)}}})));
+    for (size_t i = 0; i < ALARMS_MAX + 9; i++)
+        raise(3, std::to_string(i), std::string(5000, 'x'));
     EXPECT_EQ(daemon.alarm_owners.size(), ALARMS_MAX);
-}
-
-TEST_F(Mgmtd, TheEndOfAProcessIsToldByItsName) {
-    action(1, "/mgmtd/events/actions/interest/add",
-           {{"event_name", {bn_type_name, "/pm/events/failure/crash"}}});
-    clear();
-    action(3, "/mgmtd/process/actions/report",
-           {{"process_name", {bn_type_str, "tunneld"}}, {"event", {bn_type_str, "crash"}}});
-    ASSERT_EQ(sent.size(), 2u);
-    const std::vector<event_field> fields = fields_of(sent[0].request);
-    EXPECT_EQ(fields[0].value, (node_value{bn_type_str, "tunneld"}));
-    EXPECT_EQ(code(), 0u);
-    action(3, "/mgmtd/process/actions/report", {{"process_name", {bn_type_str, "tunneld"}}});
-    EXPECT_EQ(code(), static_cast<uint32_t>(LC_BAD_ARGUMENT));
-}
-
-TEST_F(Mgmtd, AMessageThatIsNoneEndsTheSession) {
-    owned_tbuffer frame;
-    const std::string bytes(200, '\xff');
-    ASSERT_EQ(tb_new_buf(&frame.pointer, bytes.data(), 200), LC_OK);
-    for (uint16_t mtype = 0; mtype < 10; mtype++)
-        EXPECT_FALSE(server_take_frame(&daemon, 3, mtype, frame.pointer)) << mtype;
+    size_t kept = 0;
+    for (const auto &[name, value] : daemon.state)
+        kept += value.text.size();
+    EXPECT_LT(kept, ALARMS_MAX * 1024);
 }
 
 // --- Supervision
 
-TEST(Supervision, ItStartsAgainLaterAndLaterAndEndsTheLastStartedFirst) {
+TEST(Supervision, AnEndHasItsNameAndTheNextStartItsDelay) {
     int64_t delay = 0;
     for (const int64_t expected : {1000, 2000, 4000, 8000, 16000, 30000, 30000})
         EXPECT_EQ(delay = next_delay(delay, 10), expected);
     EXPECT_EQ(next_delay(delay, SETTLED_MS), 1000);
-
-    supervisor self;
-    int64_t now = 0;
-    strings told;
-    self.now_ms = [&] { return now; };
-    self.say = [](const std::string &) {};
-    self.tell = [&](const std::string &event, const std::string &process) {
-        told.push_back(process + event);
-    };
-    self.children = {{"first", {"/bin/sleep", "100"}}, {"second", {"/bin/sh", "-c", "kill -9 $$"}}};
-    const auto reap_until = [&](auto done) {
-        for (int i = 0; i < 500 && !done(); i++) {
-            usleep(10000);
-            supervisor_reap(&self);
-        }
-        ASSERT_TRUE(done());
-    };
-    supervisor_tick(&self);
-    reap_until([&] { return self.children[1].pid == 0; });
-    EXPECT_EQ(told, strings{"second/pm/events/failure/crash"});
-    self.children[1].command = {"/bin/sleep", "100"};
-    EXPECT_EQ(supervisor_tick(&self), 1000);
-    now = 1000;
-    EXPECT_EQ(supervisor_tick(&self), -1);
-    EXPECT_NE(self.children[1].pid, 0);
-    self.ending = true;
-    EXPECT_EQ(supervisor_tick(&self), now + END_PATIENCE_MS);
-    reap_until([&] { return self.children[1].pid == 0; });
-    EXPECT_NE(self.children[0].pid, 0);
-    supervisor_tick(&self);
-    reap_until([&] { return supervisor_is_done(self); });
-    EXPECT_EQ(told.size(), 3u);
-    EXPECT_EQ(told[2], "first/pm/events/proc/terminate");
+    const struct {
+        int status;
+        bool ending;
+        const char *event;
+    } cases[] = {{SIGKILL, false, "/pm/events/failure/crash"},
+                 {SIGTERM, false, "/pm/events/proc/terminate"},
+                 {W_EXITCODE(1, 0), false, "/pm/events/failure/unexpected_exit"},
+                 {W_EXITCODE(0, 0), true, "/pm/events/proc/terminate"}};
+    for (const auto &one : cases)
+        EXPECT_STREQ(end_event(one.status, one.ending), one.event);
 }
