@@ -1,10 +1,8 @@
-// tunneld as wccpd sees it: a test plays wccpd's side of the mailbox by hand, once against the functions and
-// once against the program.
+// tunneld as wccpd sees it: a test plays wccpd's side of the mailbox by hand. The program is seen by the
+// scenarios.
 
 #include <gtest/gtest.h>
 #include <sched.h>
-#include <signal.h>
-#include <sys/resource.h>
 #include <sys/shm.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -12,7 +10,6 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <string>
 #include <thread>
 
@@ -25,16 +22,6 @@ using namespace std::chrono_literals;
 namespace {
 
 wccp_tunnel_mailbox *mailbox; // wccpd's own view of the block
-
-bool soon(const std::function<bool()> &condition) {
-    const auto give_up = std::chrono::steady_clock::now() + 10s;
-    while (!condition())
-        if (std::chrono::steady_clock::now() > give_up)
-            return false;
-        else
-            std::this_thread::sleep_for(1ms);
-    return true;
-}
 
 void give(uint16_t code, uint16_t id, uint32_t remote) {
     mailbox->command = 0;
@@ -185,45 +172,5 @@ TEST_F(Tunneld, ACommandThatWasGivenUpGetsNoAnswer) {
         EXPECT_EQ(mailbox->status, row.answered ? 0u : 77u) << row.code << " " << row.id;
         EXPECT_EQ(daemon.tunnels.size(), row.answered ? 1u : 0u);
         EXPECT_EQ(mailbox->command, row.answered ? 0 : row.code);
-    }
-}
-
-TEST_F(Tunneld, TheProgramAnswersBeforeAndAfterAnother) {
-    static constexpr const char *path = "/tmp/tunneld.out";
-    const auto output = [] {
-        std::stringstream all;
-        all << std::ifstream(path).rdbuf();
-        return all.str();
-    };
-    for (const std::string role :
-         {"ACTIVE", "BACKUP"}) { // the second one finds the mailbox as the first left it
-        mailbox->policy_roles[65535].role = role == "ACTIVE" ? 0 : 1;
-        std::filesystem::remove(path);
-        const pid_t program = fork();
-        if (program == 0) {
-            if (freopen(path, "w", stdout))
-                execl(WCCP_BIN_DIR "/tunneld", "tunneld", "--json", "--roles", "--index", "40", nullptr);
-            _exit(127);
-        }
-        give(MAILBOX_ADD_TUNNEL, 300, 0x0A000002);
-        EXPECT_TRUE(soon([] { return mailbox->command == 0; }));
-        EXPECT_EQ(mailbox->status, 0u);
-        EXPECT_EQ(mailbox->fmst_index, 40u);
-        EXPECT_TRUE(soon([&] { return output().find("policy_group") != std::string::npos; }));
-        std::this_thread::sleep_for(1s);
-        kill(program, SIGTERM);
-        int status = -1;
-        rusage used = {};
-        EXPECT_EQ(wait4(program, &status, 0, &used), program);
-        EXPECT_EQ(status, 0);
-        EXPECT_LT(used.ru_utime.tv_usec + used.ru_stime.tv_usec, 800000) << "it sleeps most of the time";
-        EXPECT_EQ(output(),
-                  R"({"event":"attached"})"
-                  "\n"
-                  R"({"command":"add","tunnel_id":300,"local":"10.0.0.1","remote":"10.0.0.2","index":40,)"
-                  R"("result":"done","tunnels":1})"
-                  "\n"
-                  R"({"policy_group":65535,"role":")" +
-                      role + "\"}\n");
     }
 }
