@@ -1,8 +1,10 @@
 // The picture of "mgmtctl show": gathered from canned nodes, drawn for a terminal and as JSON, within bounds.
 #include <gtest/gtest.h>
 
+#include <cstring>
 #include <functional>
 #include <map>
+#include <sstream>
 
 #include <nlohmann/json.hpp>
 
@@ -60,51 +62,40 @@ std::string hash_rows(const std::string &router) {
 }
 
 canned one_group() {
+    // C and S stand for the group's configuration and state; a router's nodes are those of R, its place
+    // first.
+    static const char *const lines =
+        "C 51|C/interface eth0|C/weight 25|C/password secret|C/protocol tcp|"
+        "C/router/1/ipaddr 10.0.0.1|C/router/2/ipaddr 10.0.0.2|C/router/3/ipaddr 10.0.0.3|"
+        "S 51|S/oper ACTIVE, DESIGNATED|S/uptime 3723000|S/app_id 10.0.0.101|"
+        "S/num_appliances 2|R1 10.0.0.2 ONE 20|R2 10.0.0.1 TWO 25|"
+        "S/appliance/1/ipaddr 10.0.0.101|S/appliance/1/weight 25|"
+        "S/appliance/2/ipaddr 10.0.0.102|S/appliance/2/weight 75|";
     canned from;
-    for (const auto &[node, value] : std::map<std::string, std::string>{{"", "51"},
-                                                                        {"/interface", "eth0"},
-                                                                        {"/weight", "25"},
-                                                                        {"/password", "secret"},
-                                                                        {"/protocol", "tcp"},
-                                                                        {"/router/1/ipaddr", "10.0.0.1"},
-                                                                        {"/router/2/ipaddr", "10.0.0.2"},
-                                                                        {"/router/3/ipaddr", "10.0.0.3"}})
-        from.add(CONFIG + "51" + node, value);
+    std::istringstream in(lines);
+    for (std::string name, value; std::getline(in, name, ' ') && std::getline(in, value, '|');) {
+        if (name[0] != 'R') {
+            from.add((name[0] == 'C' ? CONFIG : STATE) + "51" + name.substr(1), value);
+            continue;
+        }
+        const std::string root = STATE + "51/router/" + name.substr(1), address = value.substr(0, 8);
+        from.add(root, name.substr(1));
+        from.add(root + "/state", value.substr(9, 3) + "-WAY connected");
+        for (const char *node :
+             {"/fwd_method GRE", "/ret_method L2", "/assign_method not-set", "/conn_time 60000"})
+            from.add(root + std::string(node, strchr(node, ' ')), strchr(node, ' ') + 1);
+        for (const char *node : {"/id", "/ipaddr"})
+            from.add(root + node, address);
+        from.add(root + "/appliance/10.0.0.101/load_dist", value.substr(13));
+        from.add(root + "/appliance/10.0.0.102/load_dist", "75");
+    }
     from.add("/qv/wccpd/system/state/is_alive", "Ready");
-    from.add(STATE + "51", "51");
-    from.add(STATE + "51/oper", "ACTIVE, DESIGNATED");
-    from.add(STATE + "51/uptime", "3723000");
-    from.add(STATE + "51/app_id", "10.0.0.101");
-    from.add(STATE + "51/num_appliances", "2");
     from.add(STATE + "51/debug", "    WCCP interfaces                  : # 1 eth0\n"
                                  "    WCCP interface ipa and link      : 10.0.0.101 up \n");
-    from.add(STATE + "51/assignment", "\n\tDesignator allocation     \n\tActive appliances          : "
-                                      "2\n\tAppliance ip               : 10.0.0.101\n"
-                                      "\tHash/mask allotment        : 30 % \n\t                           : "
-                                      "0x00000000 00000000 00000000 00000000\n"
+    from.add(STATE + "51/assignment", "\tAppliance ip               : 10.0.0.101\n"
+                                      "\tHash/mask allotment        : 30 % \n"
                                       "\tReceived router allocation\n" +
                                           hash_rows("10.0.0.2") + hash_rows("10.0.0.1"));
-    for (const char *router : {"1", "2"}) {
-        const std::string root = STATE + "51/router/" + router;
-        const std::string address = *router == '1' ? "10.0.0.2" : "10.0.0.1";
-        for (const auto &[node, value] : std::map<std::string, std::string>{
-                 {"", router},
-                 {"/state", *router == '1' ? "ONE-WAY connected" : "TWO-WAY connected"},
-                 {"/fwd_method", "GRE"},
-                 {"/ret_method", "L2"},
-                 {"/assign_method", "not-set"},
-                 {"/id", address},
-                 {"/ipaddr", address},
-                 {"/conn_time", "60000"},
-                 {"/appliance/10.0.0.101", "10.0.0.101"},
-                 {"/appliance/10.0.0.101/load_dist", *router == '1' ? "20" : "25"},
-                 {"/appliance/10.0.0.102/load_dist", "75"}})
-            from.add(root + node, value);
-    }
-    from.add(STATE + "51/appliance/1/ipaddr", "10.0.0.101");
-    from.add(STATE + "51/appliance/1/weight", "25");
-    from.add(STATE + "51/appliance/2/ipaddr", "10.0.0.102");
-    from.add(STATE + "51/appliance/2/weight", "75");
     from.add(ALARM, "WCCP GRP 51: alarm: raising\033]0;evil\a adjacency down alarm");
     from.add(ALARM + "/name", "adjacency");
     from.add(ALARM + "/since", "2026/11/25 00:10:11");

@@ -63,27 +63,6 @@ TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
 
 // --- Changes
 
-TEST(Changes, WordsOfASet) {
-    const struct {
-        std::vector<std::string> words;
-        std::string result; // "NAME|VALUE " each, or what is wrong
-    } cases[] = {
-        {{"/a", "1"}, "/a|1 "},
-        {{"/a=b=c"}, "/a|b=c "},
-        {{"/a=", "/b=2"}, "/a| /b|2 "},
-        {{"/a", "1", "2"}, "expected NAME VALUE or NAME=VALUE, not \"/a\""},
-        {{"=1"}, "expected NAME VALUE or NAME=VALUE, not \"=1\""},
-    };
-    for (const auto &one : cases) {
-        std::vector<ctl_change_item> items;
-        std::string result = parse_assignments(one.words, ctl_change::create, &items);
-        if (result.empty())
-            for (const ctl_change_item &item : items)
-                result += item.binding.name + "|" + item.binding.value + " ";
-        EXPECT_EQ(result, one.result);
-    }
-}
-
 TEST(Changes, WhatARunningGroupDoesNotFollowIsTold) {
     const groups_before before = {{G51, GROUPS + "/52"},
                                   {{G51 + "/priority", "uint32", "200"},
