@@ -268,9 +268,14 @@ TEST(Show, AssignmentTextsAreReadTolerantly) {
             for (const int owner : table.owners)
                 ASSERT_LT(owner, static_cast<int>(from.appliances.size()));
     }
-    std::string crowd;
-    for (int i = 0; i < 2000; i++)
-        crowd += hash_rows(std::to_string(i)) + "\tAppliance ip               : " + std::to_string(i) + "\n";
+    std::string crowd; // each router has a table of its own, and knows an appliance of its own
+    for (int i = 0; i < 2000; i++) {
+        char words[16];
+        snprintf(words, sizeof words, "0x%08x", i + 1);
+        std::string rows = hash_rows(std::to_string(i));
+        crowd += rows.replace(rows.find("0xffffffff"), 10, words) +
+                 "\tAppliance ip               : " + std::to_string(i) + "\n";
+    }
     picture_group from;
     take_assignment_text(crowd, &from);
     EXPECT_LE(from.appliances.size(), 32u);
