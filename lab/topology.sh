@@ -186,7 +186,7 @@ lab_in() { # NAME COMMAND...
     local node=$1 all=(); shift
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
     # The root as well: the whole lab may run inside a chroot.
-    [ -n "${LAB_PID[$node/router]-}" ] || all=(--mount --root --ipc --pid)
+    [ -n "${LAB_PID[$node/router]-}" ] || all=(--mount --root --ipc --pid --wdns=/)
     (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net "${all[@]}" "$@")
 }
 
@@ -213,7 +213,7 @@ lab_start() { # NODE NAME PROGRAM ARGUMENTS...
     mgmtd | mgmtctl) program=$WCCP_BIN/$program; LAB_CLOCK=() ;;
     *) program=$WCCP_BIN/$program; lab_clock ;;
     esac
-    (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net --mount --root --ipc --pid "${LAB_CLOCK[@]}" "$program" "$@") \
+    (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net --mount --root --ipc --pid --wdns=/ "${LAB_CLOCK[@]}" "$program" "$@") \
         </dev/null >>"$LAB/$node-$name.out" 2>&1 &
     LAB_PID[$node/$name]=$!
 }
