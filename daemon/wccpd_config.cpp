@@ -610,6 +610,15 @@ lc_status wccpd_config_query() {
     return LC_OK;
 }
 
+lc_status wccpd_config_apply_to_log(const bn_binding_array *new_values) {
+    (void)qv_handle_log_level_change(new_values);
+    const bn_binding *facility = nullptr;
+    CHECK_STATUS(bn_binding_array_get_binding_by_name(new_values, FACILITY, &facility));
+    if (facility)
+        CHECK_STATUS(change_facility(facility));
+    return LC_OK;
+}
+
 lc_status wccpd_config_apply(bn_binding_array *new_values) {
     (void)qv_handle_log_level_change(new_values);
     uint32_t count = 0;

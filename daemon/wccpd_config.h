@@ -8,5 +8,7 @@
 lc_status wccpd_config_query();
 // The new values of a change event, in the order that decides what a change does to running groups.
 lc_status wccpd_config_apply(bn_binding_array *new_values);
+// Of them only what concerns the log, which is there before the engine is.
+lc_status wccpd_config_apply_to_log(const bn_binding_array *new_values);
 // Fills the field of a node kind from a binding.
 lc_status wccpd_config_update_group_binding(wccp_grp_config *config, const bn_binding *binding, int kind);

@@ -91,14 +91,16 @@ static lc_status wccpd_process_proc_fail(const char *event_name, const bn_bindin
     return LC_OK;
 }
 
-// A change that comes before the engine is begun has nothing to change; the start reads the whole tree later.
+// A change that comes before the engine is begun has no groups to change: the start reads the whole tree
+// later. The log's facility it reads from the file alone, and so what concerns the log is taken at once.
 static lc_status wccpd_config_changed(const char *, bn_binding_array *bindings) {
-    if (!wccpd_engine_begun) {
-        LC_LOG(LC_LOG_INFO, "Configuration change before the engine's start: left to the start");
-        return LC_OK;
-    }
     owned_bindings old_values, new_values;
     CHECK_STATUS(mdc_event_config_change_notif_extract(bindings, &old_values.pointer, &new_values.pointer));
+    if (!wccpd_engine_begun) {
+        LC_LOG(LC_LOG_INFO, "Configuration change before the engine's start: left to the start");
+        CHECK_STATUS(wccpd_config_apply_to_log(new_values.pointer));
+        return LC_OK;
+    }
     CHECK_STATUS(wccpd_config_apply(new_values.pointer));
     return LC_OK;
 }

@@ -335,6 +335,14 @@ TEST_F(DaemonConfig, PolicyMembership) {
     EXPECT_EQ(members(), "");
 }
 
+TEST_F(DaemonConfig, BeforeTheEngineOnlyTheLogFollows) {
+    binding_list list;
+    add_root(list, "51").add("/logging/syslog/facility/system", bn_type_uint32, "168");
+    EXPECT_EQ(wccpd_config_apply_to_log(list.array), LC_OK);
+    EXPECT_EQ(said("system facility to 21(local5), wccpd"), 1);
+    EXPECT_EQ(wccp_find_group(51), nullptr);
+}
+
 TEST_F(DaemonConfig, TheFacilityOfTheLogAndNothingElseOfIt) {
     EXPECT_EQ(lc_log_set_max_log_level("err"), LC_OK);
     EXPECT_EQ(lc_log_enable_override_log_level(1, 1), LC_OK);
