@@ -46,6 +46,7 @@
 #include "platform/file_utils.h"
 #include "platform/limits.h"
 #include "runtime/logging.h"
+#include "runtime/version.h"
 
 const char *const wccpd_program_name = "wccpd";
 lew *wccpd_lwc;
@@ -151,6 +152,7 @@ lc_status wccpd_init() {
     const int32_t facility = lc_log_get_facility(nullptr, wccpd_program_name);
     CHECK_STATUS(lc_log_init(wccpd_program_name, nullptr, 0, WCCPD_LOG_COMPONENT, LC_LOG_DEBUG, facility, 1));
     LC_LOG(LC_LOG_NOTICE, "WCCP daemon launched");
+    LC_LOG(LC_LOG_DEBUG, "wccpd version %s", wccp_version());
     CHECK_STATUS(lew_init(&wccpd_lwc));
     CHECK_NULL(wccpd_lwc);
     for (wccpd_signal &known : wccpd_signals)

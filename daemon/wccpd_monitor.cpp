@@ -16,12 +16,13 @@
 
 #include "daemon/wccpd_main.h"
 #include "daemon/wccpd_mgmt.h"
-#include "engine/wccp_config.h"
 #include "engine/wccp_debug_utils.h"
+#include "engine/wccp_query.h"
 #include "engine/wccp_utils.h"
 #include "mgmt/owners.h"
 #include "runtime/csys.h"
 #include "runtime/logging.h"
+#include "runtime/version.h"
 
 #define STATE_ROOT "/qv/wccpd/wccp/srv_grp/state"
 #define SYSTEM_STATE "/qv/wccpd/system/state"
@@ -87,6 +88,7 @@ static const mon_dump assignment_dump = {
 // First match wins.
 static const mon_node mon_nodes[] = {
     {SYSTEM_STATE "/proto_ver", bn_type_str, VALUE(put_words(out, "2.0")), nullptr},
+    {SYSTEM_STATE "/version", bn_type_str, VALUE(put_words(out, wccp_version())), nullptr},
     {STATE_ROOT "/*/oper", bn_type_str, VALUE(put_words(out, s->group_info.oper)), nullptr},
     {STATE_ROOT "/*/uptime", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->group_info.uptime)),
      nullptr},

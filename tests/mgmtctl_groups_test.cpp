@@ -4,7 +4,7 @@
 
 #include <map>
 
-#include "platform/mgmtctl/groups.h"
+#include "peers/mgmtctl/groups.h"
 #include "runtime/common.h"
 
 namespace {

@@ -8,7 +8,7 @@
 
 #include <nlohmann/json.hpp>
 
-#include "platform/mgmtctl/show_picture.h"
+#include "peers/mgmtctl/show_picture.h"
 #include "runtime/common.h"
 
 using json = nlohmann::json;

@@ -4,10 +4,10 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/binding_text.h"
-#include "platform/mgmtctl/nodes.h"
-#include "platform/mgmtctl/render.h"
-#include "platform/mgmtctl/watch.h"
+#include "peers/mgmtctl/nodes.h"
+#include "peers/mgmtctl/render.h"
+#include "peers/mgmtctl/watch.h"
+#include "peers/nodes/binding_text.h"
 #include "tests/support/gcl_provider.h"
 
 static const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config";

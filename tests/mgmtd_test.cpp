@@ -13,8 +13,8 @@
 
 #include "mgmt/bnode_proto.h"
 #include "mgmt/mdc_main.h"
-#include "platform/mgmtd/server.h"
-#include "platform/mgmtd/supervise.h"
+#include "peers/mgmtd/server.h"
+#include "peers/mgmtd/supervise.h"
 
 static const std::string GROUP = "/qv/wccpd/wccp/srv_grp/config/51";
 static const std::string STATE = "/qv/wccpd/wccp/srv_grp/state";

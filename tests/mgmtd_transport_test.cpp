@@ -4,7 +4,7 @@
 #include <gtest/gtest.h>
 #include <sys/wait.h>
 
-#include "platform/mgmtd/transport.h"
+#include "peers/mgmtd/transport.h"
 #include "tests/support/gcl_provider.h" // wire, be, padded, frame_bytes, number_at
 
 namespace {

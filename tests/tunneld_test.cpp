@@ -13,8 +13,8 @@
 #include <string>
 #include <thread>
 
+#include "peers/tunneld/tunneld.h"
 #include "platform/tunnel_mailbox.h"
-#include "platform/tunneld/tunneld.h"
 #include "runtime/cmem.h"
 
 using namespace std::chrono_literals;

@@ -22,6 +22,7 @@
 
 #include "lab/router/router.h"
 #include "lab/router/tools.h"
+#include "runtime/version.h"
 
 using namespace lab;
 
@@ -232,6 +233,7 @@ static uint32_t bits_of(const std::vector<std::string> &words, const char *first
 // NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
     CLI::App app("simulated WCCP version 2 routers");
+    app.set_version_flag("--version", std::string("wccp_router ") + wccp_version());
     app.footer(std::string("Commands on standard input or through --control:\n") + ROUTER_COMMANDS);
     app.require_subcommand(0, 1);
     std::vector<std::string> routers, forward = {"gre", "l2"}, giveback = {"gre", "l2"},

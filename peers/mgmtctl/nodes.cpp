@@ -1,0 +1,323 @@
+// Names, as a person types them: completed, put right, and judged by what the change of a node means.
+//
+// The schema says what there can be, without mgmtd; mgmtd is asked only where a part of a name is somebody's
+// choice (a group's number, a file). So the upper parts complete at once, and completion stays quick with
+// hundreds of groups.
+//
+// A commit may do less than it seems to: wccpd takes some changes of a group only with the group as a whole,
+// and lets a group go of which a node without a default is deleted. The commit is made as it was asked for,
+// and what follows for a running group is told.
+#include "peers/mgmtctl/nodes.h"
+
+#include <algorithm>
+#include <map>
+
+#include "mgmt/bnode_types.h"
+#include "peers/mgmtctl/edit_distance.h"
+#include "peers/mgmtctl/groups.h"
+#include "runtime/common.h"
+
+static const char *const GROUPS = "/qv/wccpd/wccp/srv_grp/config";
+
+static node_name named(const std::string &text) {
+    node_name out;
+    (void)parse_node_name(text, &out);
+    return out;
+}
+
+// The root of the service group that a configuration node belongs to, "" for others.
+static std::string group_of(const std::string &text) {
+    static const node_name groups = named(GROUPS);
+    node_name name = named(text);
+    if (!name.is_under(groups))
+        return "";
+    name.parts.resize(groups.parts.size() + 1);
+    return name.text();
+}
+
+static std::string number_of(const std::string &root) {
+    return root.substr(root.rfind('/') + 1);
+}
+
+// --- Names that there can be
+
+static const std::vector<node_name> &patterns() {
+    static const std::vector<node_name> all = [] {
+        std::vector<node_name> made;
+        made.reserve(schema().size() + wccpd_state_nodes().size());
+        for (const schema_row &row : schema())
+            made.push_back(row.parts);
+        for (const char *pattern : wccpd_state_nodes())
+            made.push_back(named(pattern));
+        for (const char *pattern : {"/qv/alarms/state/raised/*/*/name", "/qv/alarms/state/raised/*/*/since",
+                                    "/qv/alarms/state/raised/*/*/reporter", "/qv/alarms/state/role/*/code",
+                                    "/qv/alarms/state/role/*/since"})
+            made.push_back(named(pattern));
+        return made;
+    }();
+    return all;
+}
+
+std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above) {
+    std::set<std::string> found;
+    const size_t depth = above.parts.size();
+    bool choice = false;
+    for (node_name pattern : patterns()) {
+        if (pattern.parts.size() <= depth)
+            continue;
+        const std::string next = pattern.parts[depth];
+        pattern.parts.resize(depth);
+        if (!matches(pattern, above))
+            continue;
+        if (next == "*")
+            choice = true;
+        else
+            found.insert(next);
+    }
+    // The children alone where they are nodes, else whatever is below.
+    for (const ctl_walk walk : {ctl_walk::children, ctl_walk::subtree}) {
+        ctl_reply reply;
+        if (!choice || !ask(walk, above.text(), &reply))
+            break;
+        for (const ctl_binding &binding : reply.bindings)
+            if (const node_name name = named(binding.name); name.is_under(above)) {
+                found.insert(name.parts[depth]);
+                choice = false;
+            }
+    }
+    std::vector<std::string> out(found.begin(), found.end());
+    std::sort(out.begin(), out.end(), [](const std::string &a, const std::string &b) {
+        return node_name{{a}} < node_name{{b}}; // numbers as numbers
+    });
+    return out;
+}
+
+// --- Names that were meant
+
+static const std::string *nearest(const std::string &wanted, const std::vector<std::string> &known) {
+    const std::string *best = nullptr;
+    size_t least = std::min<size_t>(3, wanted.size()); // as many mistakes are another word
+    for (const std::string &each : known)
+        if (const size_t away = edit_distance(wanted.substr(0, 64), each); away < least) {
+            least = away;
+            best = &each;
+        }
+    return best;
+}
+
+std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
+    if (text == "/")
+        return "\"mgmtctl walk /\" lists what there is";
+    node_name name;
+    if (!parse_node_name(text, &name))
+        return text.starts_with('/') ? "a name has no empty part" : "a name begins with \"/\"";
+    if (const std::string group = group_of(text); !group.empty()) {
+        ctl_reply reply;
+        if (ask(ctl_walk::node, group, &reply) && reply.bindings.empty())
+            return "there is no group " + number_of(group);
+    }
+    ctl_reply below;
+    if (ask(ctl_walk::subtree, text, &below) && !below.bindings.empty())
+        return "it has no value of its own; \"mgmtctl walk " + text + "\" lists what is below";
+    if (const schema_row *row = find_schema_row(name))
+        return row->instance ? "" : "it can be set, and has no default";
+    // From the top down to the first part that can't be.
+    node_name good;
+    for (const std::string &part : name.parts) {
+        const std::vector<std::string> known = names_below(ask, good);
+        if (std::find(known.begin(), known.end(), part) == known.end()) {
+            if (const std::string *meant = nearest(part, known))
+                return "did you mean " + good.below(*meant).text() + "?";
+            return known.empty() ? ""
+                                 : "\"mgmtctl walk " + (good.parts.empty() ? "/" : good.text()) +
+                                       "\" lists what there is";
+        }
+        good.parts.push_back(part);
+    }
+    return "";
+}
+
+std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &text) {
+    node_name name;
+    if (parse_node_name(text, &name) && find_schema_row(name))
+        return "";
+    for (const char *root : {"/qv/wccpd/system/state", "/qv/wccpd/wccp/srv_grp/state", "/qv/alarms/state"})
+        if (name == named(root) || name.is_under(named(root)))
+            return "it is a state: it can only be read";
+    return hint_for_missing(ask, text);
+}
+
+// --- Completion
+
+static std::vector<std::string> value_completions(const std::string &name_text, const std::string &begin) {
+    const schema_row *row = find_schema_row(named(name_text));
+    std::string words = row && row->words ? row->words : row && row->type == bn_type_bool ? "true|false" : "";
+    std::vector<std::string> out;
+    while (!words.empty()) {
+        const std::string word = words.substr(0, words.find('|'));
+        words.erase(0, word.size() + 1);
+        if (word.starts_with(begin))
+            out.push_back(std::string(name_text).append("=").append(word));
+    }
+    return out;
+}
+
+std::vector<std::string> completions(const ctl_ask &ask, const std::string &word) {
+    if (const size_t equals = word.find('='); equals != std::string::npos)
+        return value_completions(word.substr(0, equals), word.substr(equals + 1));
+    size_t slash = word.rfind('/');
+    while (slash != std::string::npos && slash > 0 && word[slash - 1] == '\\')
+        slash = word.rfind('/', slash - 1);
+    if (slash == std::string::npos)
+        return word.empty() ? std::vector<std::string>{"/"} : std::vector<std::string>{};
+    node_name above;
+    if (slash > 0 && !parse_node_name(word.substr(0, slash), &above))
+        return {};
+    std::vector<std::string> out;
+    for (const std::string &part : names_below(ask, above))
+        if (const std::string whole = above.below(part).text(); whole.starts_with(word))
+            out.push_back(whole);
+    return out;
+}
+
+// --- Appliances of a walk
+
+bool add_appliances(const ctl_ask &ask, const std::string &root_text, std::vector<ctl_binding> *inout) {
+    static const node_name counts = named("/qv/wccpd/wccp/srv_grp/state/*/num_appliances");
+    const node_name root = named(root_text);
+    node_name list = counts;
+    list.parts.back() = "appliance";
+    std::vector<ctl_binding> counted;
+    for (const ctl_binding &binding : *inout)
+        if (matches(counts, named(binding.name)))
+            counted.push_back(binding);
+    // A walk from the list itself down has no count in it.
+    if (matches(list, root)) {
+        node_name count = root;
+        count.parts.back() = counts.parts.back();
+        ctl_reply reply;
+        if (!ask(ctl_walk::node, count.text(), &reply))
+            return false;
+        counted = reply.bindings;
+    }
+    for (const ctl_binding &count : counted) {
+        node_name one = named(count.name);
+        one.parts.back() = "appliance";
+        std::vector<ctl_binding> added;
+        const unsigned long number = std::min(strtoul(count.value.c_str(), nullptr, 10), 32ul);
+        for (unsigned long i = 1; i <= number; i++)
+            for (const char *leaf : {"ipaddr", "weight"}) {
+                ctl_reply reply;
+                if (!ask(ctl_walk::node, one.below(std::to_string(i)).below(leaf).text(), &reply))
+                    return false;
+                added.insert(added.end(), reply.bindings.begin(), reply.bindings.end());
+            }
+        const auto at = std::find_if(inout->begin(), inout->end(),
+                                     [&](const ctl_binding &binding) { return binding.name == count.name; });
+        inout->insert(at == inout->end() ? at : at + 1, added.begin(), added.end());
+    }
+    return true;
+}
+
+// --- Changes
+
+std::string parse_assignments(const std::vector<std::string> &words, ctl_change change,
+                              std::vector<ctl_change_item> *out) {
+    if (words.size() == 2 && words[0].find('=') == std::string::npos) {
+        out->push_back({change, {words[0], "", words[1]}});
+        return "";
+    }
+    for (const std::string &word : words) {
+        const size_t equals = word.find('=');
+        if (equals == std::string::npos || equals == 0)
+            return "expected NAME VALUE or NAME=VALUE, not \"" + word + "\"";
+        out->push_back({change, {word.substr(0, equals), "", word.substr(equals + 1)}});
+    }
+    return "";
+}
+
+bool look_before(const ctl_ask &ask, const std::vector<ctl_change_item> &items, groups_before *out) {
+    for (const ctl_change_item &item : items) {
+        const std::string root = group_of(item.binding.name);
+        if (root.empty())
+            continue;
+        for (const std::string &name : {root, item.binding.name}) {
+            ctl_reply reply;
+            if (!ask(ctl_walk::node, name, &reply))
+                return false;
+            if (!reply.bindings.empty() && name == root)
+                out->roots.insert(root);
+            out->bindings.insert(out->bindings.end(), reply.bindings.begin(), reply.bindings.end());
+        }
+    }
+    return true;
+}
+
+static const ctl_binding *find_binding(const std::vector<ctl_binding> &bindings, const std::string &name) {
+    for (const ctl_binding &binding : bindings)
+        if (binding.name == name)
+            return &binding;
+    return nullptr;
+}
+
+// The part of the name behind its group when wccpd takes a change of the node only with the whole group.
+static std::string whole_word(const std::string &name, const std::string &root) {
+    const std::string rest = name.size() > root.size() ? name.substr(root.size() + 1) : "";
+    for (const group_word &word : group_words())
+        if (word.whole && rest.substr(0, rest.find('/')) == word.node)
+            return word.node;
+    return "";
+}
+
+static std::string joined(const std::set<std::string> &words) {
+    std::string out;
+    for (const std::string &word : words)
+        out += (out.empty() ? "" : ", ") + word;
+    return out;
+}
+
+change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_before &before) {
+    change_notes out;
+    std::set<std::string> touched, ended;                               // roots
+    std::map<std::string, std::set<std::string>> not_followed, dropped; // words by root
+    for (const ctl_change_item &item : items) {
+        const std::string &name = item.binding.name;
+        const std::string root = group_of(name);
+        if (root.empty())
+            continue;
+        touched.insert(root);
+        const bool removed = item.change == ctl_change::remove || item.change == ctl_change::reset;
+        const bool stood = before.roots.contains(root);
+        const ctl_binding *old = find_binding(before.bindings, name);
+        if (!stood && !removed &&
+            std::find(out.created.begin(), out.created.end(), root) == out.created.end())
+            out.created.push_back(root);
+        if (removed && stood && name == root)
+            ended.insert(root);
+        if (!stood || name == root)
+            continue;
+        const schema_row *row = find_schema_row(named(name));
+        if (removed && old && row && !row->fallback)
+            dropped[root].insert(name.substr(root.size() + 1));
+        else if (const std::string word = whole_word(name, root);
+                 !word.empty() && (!old || removed || old->value != item.binding.value))
+            not_followed[root].insert(word);
+    }
+    for (const auto &[root, words] : dropped)
+        if (!ended.contains(root))
+            out.notes.push_back("group " + number_of(root) + ": without " + joined(words) +
+                                " wccpd lets a running group go, until \"mgmtctl group restart " +
+                                number_of(root) + "\"");
+    for (const auto &[root, words] : not_followed)
+        if (!ended.contains(root) && !dropped.contains(root))
+            out.notes.push_back("group " + number_of(root) + ": a running group follows a change of " +
+                                joined(words) +
+                                " only when it is deleted and created again: \"mgmtctl group restart " +
+                                number_of(root) + "\"");
+    if (touched.size() > 1 && (!out.created.empty() || !ended.empty()) &&
+        touched.size() > out.created.size() + ended.size())
+        out.notes.push_back(
+            "wccpd follows a commit that creates or deletes a group in that alone: the changes of "
+            "other groups are followed only when these are deleted and created again");
+    return out;
+}

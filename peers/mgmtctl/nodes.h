@@ -1,0 +1,44 @@
+// What mgmtctl knows of nodes beyond their names: which there can be, what a change of them means for a
+// running group, and which name somebody may have meant.
+#pragma once
+
+#include <functional>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "peers/mgmtctl/session.h"
+#include "peers/nodes/schema.h"
+
+// A query of the session, so that a test can answer it. False: no answer.
+using ctl_ask = std::function<bool(ctl_walk walk, const std::string &name, ctl_reply *out)>;
+
+// The parts that can follow a name: fixed ones of the schema and of the states, and those that there are
+// where the name's next part is somebody's choice. Sorted.
+std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above);
+// What to say to somebody who asked for a node that doesn't exist, or wanted to change one that can't be. May
+// be empty.
+std::string hint_for_missing(const ctl_ask &ask, const std::string &name);
+std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &name);
+// Words that could stand in the place of a beginning: node names up to their next part, or NAME=VALUE.
+std::vector<std::string> completions(const ctl_ask &ask, const std::string &word);
+
+// A walk of wccpd's states leaves the appliances of a group out, since they are asked for by number: they are
+// asked for and put in their place. False: no answer.
+bool add_appliances(const ctl_ask &ask, const std::string &root, std::vector<ctl_binding> *inout);
+
+// NAME VALUE, or NAME=VALUE..., as items of one commit. Empty, or what is wrong.
+std::string parse_assignments(const std::vector<std::string> &words, ctl_change change,
+                              std::vector<ctl_change_item> *out);
+
+// Groups as they stood before a commit, and what there is to be said of it.
+struct groups_before {
+    std::set<std::string> roots;       // of groups
+    std::vector<ctl_binding> bindings; // of the nodes that are changed
+};
+bool look_before(const ctl_ask &ask, const std::vector<ctl_change_item> &items, groups_before *out);
+struct change_notes {
+    std::vector<std::string> created; // roots of groups that are new
+    std::vector<std::string> notes;
+};
+change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_before &before);

@@ -1,0 +1,46 @@
+// What a person and what a script gets to see, and how a failure is told to either.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include <nlohmann/json.hpp>
+
+#include "peers/mgmtctl/commands.h"
+
+using ctl_json = nlohmann::ordered_json;
+
+// Standard output; a failure shows when the program ends.
+void put(const std::string &text);
+std::string json_line(const ctl_json &value); // with its newline
+
+// Numbers, durations and booleans become numbers and booleans, a node without value null.
+ctl_json json_value(const ctl_binding &binding);
+ctl_json json_node(const ctl_binding &binding, bool secrets); // name, type, value
+// The value; a password, also one in a dump, becomes eight stars unless asked for.
+std::string shown_value(const ctl_binding &binding, bool secrets);
+// "NAME = VALUE"; further lines of the value are indented.
+std::string text_node(const ctl_binding &binding, bool secrets);
+
+struct ctl_failure {
+    int exit;
+    std::string node; // or empty
+    std::string error;
+    std::string hint; // or empty
+    uint32_t code = 0;
+};
+int exit_of(uint32_t code); // of a status code that mgmtd answered
+ctl_json json_failure(const ctl_failure &failure);
+std::string text_failure(const ctl_failure &failure);
+// To standard error, or as JSON to standard output; gives the exit code. A program that was told to end says
+// nothing.
+int tell_failure(const ctl_options &options, const ctl_failure &failure);
+
+// The alarms that stand, from a walk of ALARM_ROOT.
+inline constexpr const char *ALARM_ROOT = "/qv/alarms/state/raised";
+struct ctl_alarm {
+    std::string type, source, name, text, since, reporter;
+};
+std::vector<ctl_alarm> alarms_of(const std::vector<ctl_binding> &bindings);
+ctl_json json_alarms(const std::vector<ctl_alarm> &alarms);
+std::string text_alarms(const std::vector<ctl_alarm> &alarms);

@@ -1,0 +1,351 @@
+// The session: the project's own client library, driven by a loop of this file's over the interest list,
+// which is all that the library asks of its host.
+//
+// One thread. Every wait is a row of rounds, each of which polls what the list holds and calls its functions;
+// these read frames and end in the callbacks here, which turn an answer or an event into text at once, so
+// that nothing of the library is kept. A wait ends with what it waits for, with the loss of the session, at
+// its deadline, or when a signal has asked the program to end (ctl_stop_signal). These signals are blocked
+// from the look at it on until the poll opens them (ppoll), so that none is missed in between.
+//
+// The library logs what fails. For a person at a terminal these lines are noise beside the reason that is
+// given here, so the log is suspended for as long as the process lives.
+//
+// A reason is one sentence without a period: what is wrong, and where a person would look.
+#include "peers/mgmtctl/session.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <cstring>
+#include <ctime>
+#include <deque>
+#include <memory>
+
+#include <poll.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "mgmt/bnode_proto.h"
+#include "mgmt/gcl.h"
+#include "peers/nodes/binding_text.h"
+#include "peers/nodes/provider_path.h"
+#include "runtime/fdintrcb.h"
+#include "runtime/logging.h"
+
+static constexpr int32_t SERVICE = 2;
+
+volatile std::sig_atomic_t ctl_stop_signal;
+
+struct ctl_session {
+    int64_t timeout_ms;
+    fdic *interests = nullptr;
+    gcl *instance = nullptr;
+    gcl_session *session = nullptr;
+    uint32_t awaited = 0; // message id of the request that waits, 0 for none
+    bool answered = false;
+    ctl_reply reply;
+    std::deque<ctl_event> events;
+
+    explicit ctl_session(int64_t limit_ms) : timeout_ms(limit_ms) {}
+    ctl_session(const ctl_session &) = delete;
+    ctl_session &operator=(const ctl_session &) = delete;
+    ~ctl_session() {
+        (void)gcl_deinit(&instance);
+        (void)fdic_deinit(&interests);
+    }
+};
+
+static bool fail(std::string *out_reason, const std::string &reason) {
+    if (out_reason)
+        *out_reason = reason;
+    return false;
+}
+
+static int64_t now_ms() {
+    timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1000000;
+}
+
+// --- Rounds
+
+static bool is_connected(const ctl_session *self) {
+    int32_t state = GCL_SESSION_NONE;
+    return gcl_session_get_state(self->session, &state, nullptr) == LC_OK && state == GCL_SESSION_CONNECTED;
+}
+
+static lc_status nothing_to_note(const fdic_event_array *, void *) {
+    return LC_OK; // each round asks for the list
+}
+
+static void call_ready(const fdic_event_array *events, const std::vector<pollfd> &polled) {
+    constexpr short broken = POLLERR | POLLHUP | POLLNVAL;
+    for (uint32_t i = 0; i < polled.size(); i++) {
+        const fdic_event *event = fdic_event_array_get_quick(events, i);
+        if ((polled[i].revents & (POLLIN | broken)) && event->want_read && event->read_function)
+            (void)event->read_function(event->fd, FDIC_READABLE, event->user_data, event->read_argument);
+        if ((polled[i].revents & (POLLOUT | broken)) && event->want_write && event->write_function)
+            (void)event->write_function(event->fd, FDIC_WRITABLE, event->user_data, event->write_argument);
+    }
+}
+
+struct blocked_signals {
+    sigset_t before;
+    blocked_signals() {
+        sigset_t stop;
+        sigemptyset(&stop);
+        for (const int number : {SIGINT, SIGTERM, SIGHUP})
+            sigaddset(&stop, number);
+        sigprocmask(SIG_BLOCK, &stop, &before);
+    }
+    ~blocked_signals() { sigprocmask(SIG_SETMASK, &before, nullptr); }
+    blocked_signals(const blocked_signals &) = delete;
+    blocked_signals &operator=(const blocked_signals &) = delete;
+};
+
+enum class round { ran, over, interrupted };
+
+// One poll until `deadline` (-1: no limit), and what is ready called.
+static round run_round(ctl_session *self, int64_t deadline) {
+    const blocked_signals blocked;
+    if (ctl_stop_signal)
+        return round::interrupted;
+    owned<fdic_event_array, fdic_event_array_release> events;
+    if (fdic_events_query(self->interests, &events.pointer) != LC_OK)
+        return round::over;
+    std::vector<pollfd> polled(fdic_event_array_length_quick(events.pointer));
+    for (uint32_t i = 0; i < polled.size(); i++) {
+        const fdic_event *event = fdic_event_array_get_quick(events.pointer, i);
+        polled[i].fd = event->has_fd ? event->fd : -1;
+        polled[i].events =
+            static_cast<short>((event->want_read ? POLLIN : 0) | (event->want_write ? POLLOUT : 0));
+    }
+    const int64_t left = deadline < 0 ? 0 : std::max<int64_t>(deadline - now_ms(), 0);
+    const timespec limit = {static_cast<time_t>(left / 1000), static_cast<long>(left % 1000 * 1000000)};
+    const int ready = ppoll(polled.data(), polled.size(), deadline < 0 ? nullptr : &limit, &blocked.before);
+    if (ready < 0)
+        return errno == EINTR ? round::interrupted : round::over;
+    if (ready == 0)
+        return round::over;
+    call_ready(events.pointer, polled);
+    return round::ran;
+}
+
+// Until `done`, in the time that requests have.
+template <typename Done>
+static bool wait_for(ctl_session *self, const char *what, Done done, std::string *out_reason) {
+    const int64_t deadline = now_ms() + self->timeout_ms;
+    while (!done()) {
+        if (!is_connected(self))
+            return fail(out_reason, std::string("mgmtd closed the session ") + what);
+        const round result = run_round(self, deadline);
+        if (result == round::over) {
+            std::string seconds = std::to_string(self->timeout_ms / 1000);
+            if (self->timeout_ms % 1000)
+                seconds += "." + std::to_string(self->timeout_ms % 1000 + 1000).substr(1);
+            return fail(out_reason, "mgmtd gave no answer in " + seconds + " s");
+        }
+        if (result == round::interrupted && ctl_stop_signal)
+            return fail(out_reason, "interrupted");
+    }
+    return true;
+}
+
+// --- What comes
+
+static std::vector<ctl_binding> as_text(const std::vector<event_field> &fields) {
+    std::vector<ctl_binding> out;
+    out.reserve(fields.size());
+    for (const event_field &field : fields)
+        out.push_back({field.name, type_name(field.value.type), field.value.text});
+    return out;
+}
+
+static lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) {
+    auto *self = static_cast<ctl_session *>(data);
+    if (self->awaited == 0 || msg->response_to != self->awaited)
+        return LC_OK; // of a request that was given up
+    self->awaited = 0;
+    self->answered = true;
+    self->reply = {msg->return_code, msg->return_message ? ts_str(msg->return_message) : "",
+                   as_text(fields_of(msg))};
+    return LC_OK;
+}
+
+static lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
+    auto *self = static_cast<ctl_session *>(data);
+    self->events.push_back({msg->text ? ts_str(msg->text) : "", as_text(fields_of(msg))});
+    return LC_OK;
+}
+
+// --- Opening
+
+static const char *const OWNER_ONLY = "only root and the user that mgmtd runs as may use it";
+
+// What the library can't tell apart, and what it would leave behind for nobody.
+static bool somebody_listens(std::string *out_reason) {
+    const std::string path = provider_path();
+    struct stat about;
+    if (stat(path.c_str(), &about) != 0 && (errno == ENOENT || errno == ENOTDIR))
+        return fail(out_reason, "mgmtd is not running (nothing listens at " + path + ")");
+    if (access(path.c_str(), W_OK) != 0 || access(GCL_SOCKET_DIRECTORY, W_OK) != 0)
+        return fail(out_reason, path + ": " + strerror(errno) + "; " + OWNER_ONLY);
+    return true;
+}
+
+static lc_status make_instance(ctl_session *self) {
+    CHECK_QUIET(fdic_init(&self->interests, nothing_to_note, nullptr));
+    CHECK_QUIET(gcl_init(&self->instance, nullptr, self->interests));
+    CHECK_QUIET(bn_set_global_callback_query_response_msg(self->instance, take_response, self));
+    CHECK_QUIET(bn_set_global_callback_set_response_msg(self->instance, take_response, self));
+    CHECK_QUIET(bn_set_global_callback_action_response_msg(self->instance, take_response, self));
+    CHECK_QUIET(bn_set_global_callback_event_request_msg(self->instance, take_event, self));
+    return gcl_session_client_new(self->instance, "mgmtctl", nullptr, 0, &self->session);
+}
+
+static bool connect_to_mgmtd(ctl_session *self, std::string *out_reason) {
+    const lc_status made = make_instance(self);
+    if (made != LC_OK)
+        return fail(out_reason, "a session can't be made: " +
+                                    std::string(lc_enum_to_string_quiet(lc_status_table, made)));
+    switch (gcl_session_client_connect_by_provider(self->session, "mgmtd", 0)) {
+    case LC_OK:
+        return true;
+    case LC_IO_ERROR:
+        return fail(out_reason, "mgmtd is not running (nothing listens at " + provider_path() + ")");
+    default:
+        return fail(out_reason, "mgmtd can't be reached: " + std::string(strerror(errno)));
+    }
+}
+
+static bool open_service(ctl_session *self, std::string *out_reason) {
+    const auto stage = [self] {
+        int32_t state = 0;
+        (void)gcl_session_get_state(self->session, nullptr, &state);
+        return state;
+    };
+    if (!wait_for(
+            self, "before it was open", [&] { return stage() == GCL_ADMIN_GREETED; }, out_reason))
+        return false;
+    if (gcl_session_client_open_service(self->session, BN_PROTO, SERVICE, nullptr, 0) != LC_OK ||
+        !wait_for(
+            self, "before it was open", [&] { return stage() == GCL_ADMIN_OPEN_ANSWERED; }, out_reason))
+        return is_connected(self) ? false : fail(out_reason, "mgmtd closed the session before it was open");
+    if (!gcl_session_service_is_open(self->session, SERVICE))
+        return fail(out_reason, "mgmtd refuses its service to us");
+    return true;
+}
+
+ctl_session *ctl_open(int64_t timeout_ms, std::string *out_reason) {
+    (void)lc_init();
+    G_logging_suspended = 1;
+    auto self = std::make_unique<ctl_session>(timeout_ms);
+    if (!somebody_listens(out_reason) || !connect_to_mgmtd(self.get(), out_reason) ||
+        !open_service(self.get(), out_reason))
+        return nullptr;
+    return self.release();
+}
+
+void ctl_close(ctl_session *session) {
+    delete session;
+}
+
+// --- Requests
+
+static bool send_request(ctl_session *self, bn_request_msg *msg, ctl_reply *out, std::string *out_reason) {
+    if (bn_request_msg_send(self->session, msg) != LC_OK && is_connected(self))
+        return fail(out_reason, "the request is too large for one message");
+    self->awaited = msg->msg_id;
+    self->answered = false;
+    const bool came = wait_for(
+        self, "during the request", [self] { return self->answered; }, out_reason);
+    self->awaited = 0;
+    *out = std::move(self->reply);
+    self->reply = {};
+    return came;
+}
+
+static bool no_memory(std::string *out_reason) {
+    return fail(out_reason, "the request can't be made");
+}
+
+bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out,
+               std::string *out_reason) {
+    uint32_t flags = 0;
+    if (walk == ctl_walk::subtree || walk == ctl_walk::leaves)
+        flags |= bn_qf_subtree | bn_qf_include_self;
+    if (walk == ctl_walk::leaves)
+        flags |= bn_qf_leaves_only;
+    const uint32_t subop = walk == ctl_walk::node ? bn_query_get : bn_query_iterate;
+    owned_request msg;
+    if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK ||
+        bn_query_request_msg_append_str(msg.pointer, subop, flags, name.c_str(), nullptr) != LC_OK)
+        return no_memory(out_reason);
+    return send_request(session, msg.pointer, out, out_reason);
+}
+
+// A type left empty, or one that the value doesn't fit, travels as a string: the receiver says what it takes.
+static bn_binding *make_value(const ctl_binding &from) {
+    uint32_t type = bn_type_str;
+    owned_attrib fits;
+    if (!type_named(from.type, &type) ||
+        bn_attrib_new_str(&fits.pointer, bn_attrib_value, type, 0, from.value.c_str()) != LC_OK)
+        type = bn_type_str;
+    return make_binding(from.name, {type, from.value});
+}
+
+bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, ctl_reply *out,
+             std::string *out_reason) {
+    static constexpr uint32_t subops[] = {bn_set_create, bn_set_modify, bn_set_delete, bn_set_reset};
+    owned_request msg;
+    if (bn_set_request_msg_create(&msg.pointer, 0) != LC_OK)
+        return no_memory(out_reason);
+    for (const ctl_change_item &item : items) {
+        owned_binding binding(make_value(item.binding));
+        if (!binding.pointer ||
+            bn_set_request_msg_append_binding_takeover(msg.pointer, subops[static_cast<size_t>(item.change)],
+                                                       0, &binding.pointer, nullptr) != LC_OK)
+            return no_memory(out_reason);
+    }
+    return send_request(session, msg.pointer, out, out_reason);
+}
+
+bool ctl_action(ctl_session *session, const std::string &name, const std::vector<ctl_binding> &bindings,
+                ctl_reply *out, std::string *out_reason) {
+    owned_request msg;
+    if (bn_action_request_msg_create(&msg.pointer, name.c_str()) != LC_OK)
+        return no_memory(out_reason);
+    for (const ctl_binding &from : bindings) {
+        owned_binding binding(make_value(from));
+        if (!binding.pointer ||
+            bn_action_request_msg_append_binding_takeover(msg.pointer, 0, &binding.pointer, nullptr) != LC_OK)
+            return no_memory(out_reason);
+    }
+    return send_request(session, msg.pointer, out, out_reason);
+}
+
+bool ctl_add_interest(ctl_session *session, const std::string &event,
+                      const std::vector<std::string> &patterns, std::string *out_reason) {
+    std::vector<ctl_binding> bindings = {{"event_name", "name", event}};
+    for (size_t i = 0; i < patterns.size(); i++)
+        bindings.push_back({"match/" + std::to_string(i + 1) + "/pattern", "string", patterns[i]});
+    ctl_reply reply;
+    if (!ctl_action(session, "/mgmtd/events/actions/interest/add", bindings, &reply, out_reason))
+        return false;
+    return reply.code == 0 || fail(out_reason, reply.message);
+}
+
+int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason) {
+    const int64_t deadline = wait_ms < 0 ? -1 : now_ms() + wait_ms;
+    while (session->events.empty()) {
+        if (!is_connected(session)) {
+            fail(out_reason, "mgmtd closed the session");
+            return -1;
+        }
+        if (run_round(session, deadline) != round::ran && session->events.empty())
+            return 0;
+    }
+    *out = std::move(session->events.front());
+    session->events.pop_front();
+    return 1;
+}

@@ -1,0 +1,281 @@
+// "mgmtctl show": one picture, or one that stays live.
+//
+// A live picture is drawn anew each second and when mgmtd tells of something, at most ten times a second; a
+// picture that took long to gather leaves mgmtd and wccpd alone for longer than it took. On a terminal it has
+// the other screen and is written over in one piece; it gives the terminal back when a signal ends or stops
+// it. Below rows that are somebody else's it is a guest: it takes no screen, hides no cursor, and says where
+// each picture begins, since the other may have moved the cursor in between. In a file or a pipe it is a line
+// for whatever has changed, with the time, and as JSON a picture a line. When mgmtd goes, a live picture says
+// so and looks for it once a second.
+#include <algorithm>
+#include <cerrno>
+#include <clocale>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+
+#include <langinfo.h>
+#include <poll.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+#include "peers/mgmtctl/commands.h"
+#include "peers/mgmtctl/show_picture.h"
+
+static constexpr int64_t PERIOD_MS = 1000;
+static constexpr int64_t BURST_MS = 100; // events within it are one
+static constexpr int FILE_COLUMNS = 120;
+static constexpr size_t PICTURE_BYTES = 1 << 16; // those of a large screen, with their colours
+static constexpr int GROUP_ROWS = 5; // of the least picture of a group that tells more than a line
+
+static volatile std::sig_atomic_t pause_wanted;
+
+namespace {
+struct viewer {
+    const ctl_options &options;
+    bool terminal = false, on_screen = false;
+    std::vector<std::string> before; // lines as they were last told
+    bool broken = false;             // nobody reads
+};
+} // namespace
+
+static bool write_out(viewer *self, const std::string &text) {
+    if (fwrite(text.data(), 1, text.size(), stdout) != text.size() || fflush(stdout) != 0)
+        self->broken = true;
+    return !self->broken;
+}
+
+// --- The terminal
+
+static screen_form form_of(const viewer &self) {
+    screen_form form;
+    form.columns = FILE_COLUMNS;
+    winsize size = {};
+    if (self.terminal) {
+        // The last column and, beside a prompt, the last row stay free.
+        const bool known = ioctl(STDOUT_FILENO, TIOCGWINSZ, &size) == 0 && size.ws_col > 0 && size.ws_row > 0;
+        form.columns = std::max((known ? size.ws_col : 80) - 1, 20);
+        form.rows = std::max((known ? size.ws_row : 24) - (self.options.watch ? self.options.below : 1), 2);
+    }
+    form.colour =
+        self.options.colour == 1 || (self.options.colour == -1 && self.terminal && !getenv("NO_COLOR"));
+    form.utf8 = strcmp(nl_langinfo(CODESET), "UTF-8") == 0;
+    return form;
+}
+
+static picture_limits limits_of(const viewer &self) {
+    picture_limits limits;
+    if (self.terminal && !self.options.json) {
+        const auto rows = static_cast<size_t>(form_of(self).rows);
+        limits.detailed = std::max<size_t>(rows / GROUP_ROWS, 1);
+        limits.listed = rows;
+        limits.alarms = rows;
+    }
+    return limits;
+}
+
+static void take_screen(viewer *self, bool take) {
+    if (self->on_screen == take || self->options.below > 0)
+        return;
+    self->on_screen = take;
+    write_out(self, take ? "\033[?1049h\033[?25l" : "\033[0m\033[?25h\033[?1049l");
+}
+
+// --- One picture
+
+static std::string clock_text() {
+    char text[16];
+    const time_t now = time(nullptr);
+    tm parts;
+    localtime_r(&now, &parts);
+    strftime(text, sizeof text, "%H:%M:%S", &parts);
+    return text;
+}
+
+// Of a line that can go: a group, whatever it says, or an alarm.
+static std::string key_of(const std::string &line) {
+    if (line.starts_with("group "))
+        return line.substr(0, line.find("  "));
+    return line.starts_with("alarm ") ? line : "";
+}
+
+static void tell_changes(viewer *self, const picture &shown) {
+    const std::vector<std::string> now = draw_lines(shown);
+    const auto missing = [](const std::vector<std::string> &from, const std::string &line) {
+        return std::find(from.begin(), from.end(), line) == from.end();
+    };
+    std::vector<std::string> keys = {""};
+    for (const std::string &line : now)
+        keys.push_back(key_of(line));
+    std::string text;
+    for (const std::string &line : self->before)
+        if (shown.unreachable.empty() && missing(keys, key_of(line)))
+            text += clock_text() + "  gone: " + key_of(line) + "\n";
+    for (const std::string &line : now)
+        if (missing(self->before, line))
+            text += clock_text() + "  " + line + "\n";
+    self->before = now;
+    write_out(self, text);
+}
+
+static void show_one(viewer *self, const picture &shown) {
+    if (self->options.json) {
+        write_out(self, draw_json(shown) + "\n");
+        return;
+    }
+    if (self->options.watch && !self->terminal) {
+        tell_changes(self, shown);
+        return;
+    }
+    screen_form form = form_of(*self);
+    if (self->options.watch)
+        form.corner = "   " + clock_text();
+    const std::vector<std::string> lines = draw_screen(shown, form);
+    std::string text = self->options.watch ? "\033[" + std::to_string(self->options.below + 1) + "H" : "";
+    for (size_t i = 0; i < lines.size(); i++) {
+        text += lines[i];
+        if (!self->options.watch)
+            text += "\n";
+        else
+            text += i + 1 < lines.size() ? "\033[K\r\n" : "\033[K\033[J";
+    }
+    write_out(self, text);
+}
+
+static picture look(const viewer &self, ctl_session *session) {
+    return gather_picture(
+        [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
+            return ctl_query(session, walk, name, out, out_reason);
+        },
+        limits_of(self));
+}
+
+// --- Staying live
+
+static int64_t now_ms() {
+    timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1000000;
+}
+
+static void take_signal(int number) {
+    if (number == SIGTSTP)
+        pause_wanted = 1;
+    else if (number != SIGWINCH)
+        ctl_stop_signal = number;
+}
+
+// Those that would leave the terminal as it is; main has taken the others. What was ignored stays so.
+static void take_signals() {
+    struct sigaction action = {}, before;
+    action.sa_handler = take_signal; // without SA_RESTART: it ends a wait
+    for (const int number : {SIGQUIT, SIGTSTP, SIGWINCH})
+        if (sigaction(number, nullptr, &before) == 0 && before.sa_handler != SIG_IGN)
+            sigaction(number, &action, nullptr);
+}
+
+static void wait_without_session() {
+    (void)poll(nullptr, 0, PERIOD_MS);
+}
+
+static void pause_if_wanted(viewer *self) {
+    if (!pause_wanted)
+        return;
+    pause_wanted = 0;
+    take_screen(self, false);
+    raise(SIGSTOP);
+}
+
+static bool add_interests(ctl_session *session, std::string *out_reason) {
+    static const struct {
+        const char *event;
+        std::vector<std::string> patterns;
+    } wanted[] = {
+        {"/mgmtd/notify/dbchange", {"/qv/wccpd/**", "/qv/tunneld/system/config/mode"}},
+        {"/qv/alarms/events/raise_alarm", {}},
+        {"/qv/alarms/events/clear_alarm", {}},
+        {"/qv/state/events/role_change", {}},
+        {"/pm/events/failure/crash", {}},
+        {"/pm/events/failure/unexpected_exit", {}},
+        {"/pm/events/proc/terminate", {}},
+    };
+    return std::all_of(std::begin(wanted), std::end(wanted), [&](const auto &each) {
+        return ctl_add_interest(session, each.event, each.patterns, out_reason);
+    });
+}
+
+// Until it is time for the next picture, after one that cost so long. False: the session has ended.
+static bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reason) {
+    const int64_t began = now_ms();
+    int64_t until = began + std::max(PERIOD_MS, 4 * cost_ms);
+    while (!ctl_stop_signal && !pause_wanted) {
+        ctl_event event;
+        const int came = ctl_next_event(session, std::max<int64_t>(until - now_ms(), 0), &event, out_reason);
+        if (came < 0)
+            return false;
+        if (came == 0)
+            return true;
+        until = std::min(until, began + std::max(BURST_MS, cost_ms));
+    }
+    return true;
+}
+
+static int watch(viewer *self) {
+    ctl_session *session = nullptr;
+    take_signals();
+    if (self->terminal)
+        setvbuf(stdout, nullptr, _IOFBF, PICTURE_BYTES); // or each line is written by itself
+    while (!ctl_stop_signal && !self->broken) {
+        picture shown;
+        if (!session) {
+            session = ctl_open(self->options.timeout_ms, &shown.unreachable);
+            if (session && !add_interests(session, &shown.unreachable)) {
+                ctl_close(session);
+                session = nullptr;
+            }
+        }
+        const int64_t began = now_ms();
+        if (session)
+            shown = look(*self, session);
+        const int64_t cost_ms = now_ms() - began;
+        if (ctl_stop_signal)
+            break;
+        if (self->terminal && !self->options.json)
+            take_screen(self, true);
+        show_one(self, shown);
+        std::string reason;
+        if (session && (!shown.unreachable.empty() || !wait_for_news(session, cost_ms, &reason))) {
+            ctl_close(session);
+            session = nullptr;
+        }
+        if (!session && !shown.unreachable.empty() && !ctl_stop_signal)
+            wait_without_session();
+        pause_if_wanted(self);
+    }
+    take_screen(self, false);
+    if (session)
+        ctl_close(session);
+    return CTL_OK;
+}
+
+int ctl_show(const ctl_options &options) {
+    viewer self = {options, false, false, {}, false};
+    const char *kind = getenv("TERM");
+    self.terminal = isatty(STDOUT_FILENO) && kind && strcmp(kind, "dumb") != 0;
+    setlocale(LC_CTYPE, "");
+    if (options.watch)
+        return watch(&self);
+    picture shown;
+    if (ctl_session *session = ctl_open(options.timeout_ms, &shown.unreachable)) {
+        shown = look(self, session);
+        ctl_close(session);
+    }
+    if (shown.unreachable.empty() || options.json)
+        show_one(&self, shown);
+    if (shown.unreachable.empty())
+        return CTL_OK;
+    if (!options.json)
+        fprintf(stderr, "mgmtctl: %s\n", shown.unreachable.c_str());
+    return CTL_UNREACHABLE;
+}

@@ -1,0 +1,148 @@
+// What only wccpd's texts tell: which appliance has which bucket, what the designated appliance allots, and
+// the state of a group's interface.
+//
+// The texts are rows of a label and a value; a row that isn't known is passed over, and a text that was cut
+// gives what stood before the cut. Bounds: lines, routers, appliances and buckets as the engine has them at
+// most. A router's words come as they were stored: of a hash table each word has its first bucket in its
+// highest byte, of a mask table in its lowest bit.
+#include <algorithm>
+#include <bit>
+#include <cstdio>
+#include <map>
+#include <string_view>
+
+#include "peers/mgmtctl/show_picture.h"
+
+static constexpr size_t LINES_MAX = 8192;
+static constexpr size_t TABLES_MAX = 32; // of different routers
+static constexpr size_t BUCKETS = 256;
+
+namespace {
+struct dump_row {
+    std::string_view label, value;
+};
+} // namespace
+
+static std::string_view trimmed(std::string_view text) {
+    const size_t first = text.find_first_not_of(" \t");
+    if (first == std::string_view::npos)
+        return {};
+    return text.substr(first, text.find_last_not_of(" \t\r") - first + 1);
+}
+
+template <typename Take>
+static void each_row(std::string_view text, Take take) {
+    for (size_t lines = 0; !text.empty() && lines < LINES_MAX; lines++) {
+        const size_t end = text.find('\n');
+        const std::string_view line = text.substr(0, end);
+        text = end == std::string_view::npos ? std::string_view{} : text.substr(end + 1);
+        const size_t colon = line.find(" : ");
+        if (colon == std::string_view::npos)
+            take(dump_row{trimmed(line), {}});
+        else
+            take(dump_row{trimmed(line.substr(0, colon)), trimmed(line.substr(colon + 3))});
+    }
+}
+
+static std::string address_in(std::string_view value) {
+    return clean_text(std::string(value), 15);
+}
+
+static bool words_in(std::string_view value, uint32_t *out) {
+    const std::string text(value.substr(0, 64));
+    return sscanf(text.c_str(), "0x%8x %8x %8x %8x", &out[0], &out[1], &out[2], &out[3]) == 4;
+}
+
+namespace {
+struct assignment_reader {
+    picture_group *group;
+    bool routers = false; // in the part of what they report
+    std::string router;
+    int place = -1;
+    int words_at = -1; // where the next line of words goes, -1: nowhere
+    bool mask = false;
+    std::map<std::string, picture_table> tables; // by router
+};
+} // namespace
+
+static void put_words(assignment_reader *in, const uint32_t *words) {
+    if (in->place < 0 || (in->tables.size() >= TABLES_MAX && !in->tables.contains(in->router)))
+        return;
+    picture_table *table = &in->tables[in->router];
+    table->mask = in->mask;
+    table->owners.resize(BUCKETS, -1);
+    for (size_t i = 0; i < 128; i++) {
+        const size_t shift = in->mask ? i % 32 : (3 - i / 8 % 4) * 8 + i % 8;
+        if (words[i / 32] >> shift & 1)
+            table->owners[static_cast<size_t>(in->words_at) * 32 + i] = in->place;
+    }
+}
+
+static void take_row(assignment_reader *in, const dump_row &row) {
+    uint32_t words[4];
+    if (in->words_at >= 0 && row.label.empty() && words_in(row.value, words)) {
+        put_words(in, words);
+        in->words_at = -1;
+    } else if (row.label == "Received router allocation") {
+        in->routers = true;
+    } else if (row.label == "Router id") {
+        in->router = address_in(row.value);
+    } else if (row.label == "Appliance ip") {
+        in->place = appliance_place(in->group, address_in(row.value));
+    } else if (row.label == "Hash/mask allotment" && !in->routers && in->place >= 0) {
+        in->group->appliances[static_cast<size_t>(in->place)].asked_percent =
+            std::clamp(atoi(std::string(row.value.substr(0, 8)).c_str()), 0, 100);
+    } else if (row.label == "Rxed hash assignment" || row.label.starts_with("Rxed value buckets")) {
+        in->mask = row.label.starts_with("Rxed value");
+        in->words_at = 0;
+        if (words_in(row.value, words))
+            put_words(in, words);
+        in->words_at = in->mask ? -1 : 4;
+    }
+}
+
+// A mask table has as many values as its bits give: up to the last that has an owner, and a power of two.
+static void finish_table(picture_table *table) {
+    if (!table->mask)
+        return;
+    size_t count = table->owners.size();
+    while (count > 0 && table->owners[count - 1] < 0)
+        count--;
+    table->owners.resize(std::bit_ceil(count));
+}
+
+void take_assignment_text(const std::string &text, picture_group *inout) {
+    assignment_reader in = {.group = inout, .router = {}, .tables = {}};
+    each_row(text, [&](const dump_row &row) { take_row(&in, row); });
+    for (auto &reported : in.tables) {
+        const std::string &router = reported.first;
+        picture_table &table = reported.second; // names of their own, for clang 14 lets no lambda see parts
+        finish_table(&table);
+        const bool owned =
+            std::any_of(table.owners.begin(), table.owners.end(), [](int o) { return o >= 0; });
+        if (!owned)
+            continue;
+        auto same = std::find_if(inout->tables.begin(), inout->tables.end(), [&](const picture_table &t) {
+            return t.mask == table.mask && t.owners == table.owners;
+        });
+        if (same == inout->tables.end())
+            same = inout->tables.insert(same, std::move(table));
+        same->routers.push_back(router);
+    }
+}
+
+void take_group_text(const std::string &text, picture_group *inout) {
+    bool first = true;
+    each_row(text, [&](const dump_row &row) {
+        if (!first)
+            return;
+        const std::string value(row.value.substr(0, 64));
+        if (row.label == "WCCP interfaces" && inout->interface.empty()) {
+            const size_t name = value.rfind(' ');
+            inout->interface = clean_text(value.substr(name == std::string::npos ? 0 : name + 1), 15);
+        } else if (row.label == "WCCP interface ipa and link") {
+            inout->link = value.ends_with(" up") ? "up" : value.ends_with(" down") ? "down" : "";
+            first = false;
+        }
+    });
+}

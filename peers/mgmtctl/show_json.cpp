@@ -1,0 +1,111 @@
+// The picture for scripts. The keys are documented (docs/mgmtctl.md) and stay; what isn't known is null.
+#include <nlohmann/json.hpp>
+
+#include "peers/mgmtctl/show_picture.h"
+
+using json = nlohmann::ordered_json;
+
+static json text_or_null(const std::string &text) {
+    return text.empty() ? json(nullptr) : json(text);
+}
+static json number_or_null(int64_t number) {
+    return number < 0 ? json(nullptr) : json(number);
+}
+
+static json router_json(const picture_router &router) {
+    json shares = json::object();
+    for (const picture_load &load : router.loads)
+        shares[load.appliance] = load.percent;
+    return {{"address", router.address},
+            {"id", router.id},
+            {"configured", router.configured},
+            {"connection", router.connection},
+            {"connected_ms", router.connected_ms},
+            {"forward", text_or_null(router.forward)},
+            {"assign", text_or_null(router.assign)},
+            {"return", text_or_null(router.back)},
+            {"shares", shares}};
+}
+
+static json appliance_json(const picture_appliance &one) {
+    json out = {{"address", one.address},
+                {"self", one.self},
+                {"weight", number_or_null(one.weight)},
+                {"asked_percent", number_or_null(one.asked_percent)}};
+    out["share_percent"] = one.reported ? json(one.least_percent) : json(nullptr);
+    out["share_percent_most"] = one.reported ? json(one.most_percent) : json(nullptr);
+    return out;
+}
+
+// Buckets that follow one another and have one owner are one entry.
+static json table_json(const picture_group &group, const picture_table &table) {
+    json runs = json::array();
+    for (size_t i = 0; i < table.owners.size(); i++) {
+        const int owner = table.owners[i];
+        if (i == 0 || owner != table.owners[i - 1])
+            runs.push_back(
+                {{"first", i},
+                 {"last", i},
+                 {"appliance",
+                  owner < 0 ? json(nullptr) : json(group.appliances[static_cast<size_t>(owner)].address)}});
+        runs.back()["last"] = i;
+    }
+    return {{"kind", table.mask ? "mask" : "hash"}, {"routers", table.routers}, {"buckets", runs}};
+}
+
+static json group_json(const picture_group &group) {
+    json out = {{"id", group.id},
+                {"configured", group.configured},
+                {"admin", text_or_null(group.admin)},
+                {"interface", text_or_null(group.interface)},
+                {"protocol", text_or_null(group.protocol)},
+                {"priority", number_or_null(group.priority)},
+                {"weight", number_or_null(group.weight)},
+                {"encap", text_or_null(group.encap)},
+                {"assign_method", text_or_null(group.assign_method)},
+                {"policy", number_or_null(group.policy)},
+                {"password", group.authenticated},
+                {"running", group.running},
+                {"state", text_or_null(group.state)},
+                {"designated", group.designated},
+                {"uptime_ms", group.uptime_ms},
+                {"address", text_or_null(group.address)},
+                {"link", text_or_null(group.link)}};
+    out["routers"] = json::array();
+    for (const picture_router &router : group.routers)
+        out["routers"].push_back(router_json(router));
+    out["appliances"] = json::array();
+    for (const picture_appliance &one : group.appliances)
+        out["appliances"].push_back(appliance_json(one));
+    out["tables"] = json::array();
+    for (const picture_table &table : group.tables)
+        out["tables"].push_back(table_json(group, table));
+    return out;
+}
+
+std::string draw_json(const picture &shown) {
+    static const char *const conditions[] = {"running", "silent", "absent"};
+    json out = {{"mgmtd", shown.unreachable.empty() ? "running" : "unreachable"}};
+    if (!shown.unreachable.empty()) {
+        out["reason"] = shown.unreachable;
+        return out.dump(-1, ' ', true, json::error_handler_t::replace);
+    }
+    out["wccpd"] = conditions[static_cast<int>(shown.wccpd)];
+    out["status"] = text_or_null(shown.status);
+    out["mode"] = text_or_null(shown.mode);
+    out["groups_total"] = shown.groups_total;
+    out["groups"] = json::array();
+    for (const picture_group &group : shown.groups)
+        out["groups"].push_back(group_json(group));
+    out["alarms_total"] = shown.alarms_total;
+    out["alarms"] = json::array();
+    for (const picture_alarm &alarm : shown.alarms)
+        out["alarms"].push_back({{"type", alarm.type},
+                                 {"name", alarm.name},
+                                 {"group", number_or_null(alarm.group)},
+                                 {"source", alarm.source},
+                                 {"text", alarm.text},
+                                 {"since", text_or_null(alarm.since)},
+                                 {"reporter", text_or_null(alarm.reporter)}});
+    return out.dump(-1, ' ', true, json::error_handler_t::replace);
+}

@@ -1,0 +1,431 @@
+// Gathering the picture: what wccpd's monitoring nodes, mgmtd's alarms and roles, and the configuration say.
+//
+// A group costs a walk of its nodes (its texts among them), one of its routers with their appliances, one of
+// its configuration, and two queries for each appliance, whose numbers cannot be walked. wccpd answers node
+// by node under its engine lock; so when more groups stand than a screen has room for, each comes briefly,
+// with six nodes: the share is then that at its first router. The number of queries has an end in any case.
+//
+// Each answer shows its own moment. A group, router or appliance that is gone by the time it is asked for
+// just has no nodes, and is left out. Once wccpd has not answered, it is not asked again for this picture.
+#include "peers/mgmtctl/show_picture.h"
+
+#include <algorithm>
+#include <charconv>
+
+#include <arpa/inet.h>
+
+#include "peers/mgmtctl/render.h"
+#include "runtime/common.h"
+
+static const char *const CONFIGS = "/qv/wccpd/wccp/srv_grp/config";
+static const char *const STATES = "/qv/wccpd/wccp/srv_grp/state";
+static const char *const ROLES = "/qv/alarms/state/role";
+
+static constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
+static constexpr size_t APPLIANCES_MAX = 32;
+
+std::string clean_text(const std::string &text, size_t most) {
+    std::string out = text.substr(0, most);
+    for (char &c : out)
+        if (c < 0x20 || c > 0x7e)
+            c = '?';
+    return out;
+}
+
+int appliance_place(picture_group *inout, const std::string &address) {
+    for (size_t i = 0; i < inout->appliances.size(); i++)
+        if (inout->appliances[i].address == address)
+            return static_cast<int>(i);
+    if (address.empty() || inout->appliances.size() >= APPLIANCES_MAX)
+        return -1;
+    inout->appliances.emplace_back().address = address;
+    inout->appliances.back().self = address == inout->address;
+    return static_cast<int>(inout->appliances.size() - 1);
+}
+
+template <typename Number>
+static Number number_of(const std::string &text, Number otherwise) {
+    Number out = otherwise;
+    (void)std::from_chars(text.data(), text.data() + text.size(), out);
+    return out;
+}
+
+// The parts of a name below `root`, a "\/" in them read as "/"; none for a name that isn't below it.
+static std::vector<std::string> parts_below(const std::string &root, const std::string &name) {
+    std::vector<std::string> out;
+    if (!name.starts_with(root + "/"))
+        return out;
+    out.emplace_back();
+    for (size_t i = root.size() + 1; i < name.size(); i++) {
+        if (name[i] == '\\' && i + 1 < name.size() && (name[i + 1] == '/' || name[i + 1] == '\\'))
+            out.back() += name[++i];
+        else if (name[i] == '/')
+            out.emplace_back();
+        else
+            out.back() += name[i];
+    }
+    return out;
+}
+
+namespace {
+struct gathering {
+    const picture_query &query;
+    const picture_limits &limits;
+    picture shown;
+    size_t queries = 0;
+
+    // False ends the whole: there is no answer any more.
+    bool ask(ctl_walk walk, const std::string &name, ctl_reply *out) {
+        std::string reason;
+        queries++;
+        *out = {};
+        if (query(walk, name, out, &reason))
+            return true;
+        shown = {};
+        shown.unreachable = reason.empty() ? "no answer" : clean_text(reason, 200);
+        return false;
+    }
+    // The same of wccpd's nodes; nothing comes once it doesn't answer.
+    bool ask_wccpd(ctl_walk walk, const std::string &name, ctl_reply *out) {
+        *out = {};
+        if (shown.wccpd != picture_wccpd::running)
+            return true;
+        if (!ask(walk, name, out))
+            return false;
+        if (out->code == LC_IO_CLOSED)
+            shown.wccpd = picture_wccpd::absent;
+        else if (out->code == LC_IO_TIMED_OUT)
+            shown.wccpd = picture_wccpd::silent;
+        return true;
+    }
+};
+
+template <typename Subject>
+struct node_row {
+    const char *node;
+    void (*take)(Subject *subject, const std::string &value);
+};
+} // namespace
+
+template <typename Subject, size_t COUNT>
+static void take_node(const node_row<Subject> (&rows)[COUNT], const std::string &node,
+                      const std::string &value, Subject *subject) {
+    for (const auto &row : rows)
+        if (node == row.node)
+            row.take(subject, value);
+}
+
+// "GRE" and the like, as words of the configuration; "not set" and "not-set" are none.
+static std::string method_word(const std::string &value) {
+    std::string out = clean_text(value, 16);
+    std::transform(out.begin(), out.end(), out.begin(),
+                   [](char c) { return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c; });
+    return out.starts_with("not") ? "" : out;
+}
+
+static const node_row<picture_router> router_rows[] = {
+    {"state",
+     [](picture_router *r, const std::string &v) {
+         r->connection = v.starts_with("TWO-WAY")   ? "two-way"
+                         : v.starts_with("ONE-WAY") ? "one-way"
+                                                    : "unknown";
+     }},
+    {"fwd_method", [](picture_router *r, const std::string &v) { r->forward = method_word(v); }},
+    {"assign_method", [](picture_router *r, const std::string &v) { r->assign = method_word(v); }},
+    {"ret_method", [](picture_router *r, const std::string &v) { r->back = method_word(v); }},
+    {"id", [](picture_router *r, const std::string &v) { r->id = clean_text(v, 15); }},
+    {"ipaddr", [](picture_router *r, const std::string &v) { r->address = clean_text(v, 15); }},
+    {"conn_time",
+     [](picture_router *r, const std::string &v) { r->connected_ms = number_of<uint64_t>(v, 0); }},
+};
+
+static const node_row<picture_group> group_rows[] = {
+    {"oper",
+     [](picture_group *g, const std::string &v) {
+         g->running = true;
+         g->state = clean_text(v.substr(0, v.find(',')), 16);
+         g->designated = v.ends_with(", DESIGNATED");
+     }},
+    {"uptime", [](picture_group *g, const std::string &v) { g->uptime_ms = number_of<uint64_t>(v, 0); }},
+    {"app_id", [](picture_group *g, const std::string &v) { g->address = clean_text(v, 15); }},
+    {"num_routers",
+     [](picture_group *g, const std::string &v) { g->routers_heard = number_of<size_t>(v, 0); }},
+};
+
+static const node_row<picture_group> config_rows[] = {
+    {"interface", [](picture_group *g, const std::string &v) { g->interface = clean_text(v, 15); }},
+    {"admin", [](picture_group *g, const std::string &v) { g->admin = clean_text(v, 15); }},
+    {"protocol", [](picture_group *g, const std::string &v) { g->protocol = clean_text(v, 31); }},
+    {"encap", [](picture_group *g, const std::string &v) { g->encap = clean_text(v, 15); }},
+    {"assign_method", [](picture_group *g, const std::string &v) { g->assign_method = clean_text(v, 15); }},
+    {"password", [](picture_group *g, const std::string &v) { g->authenticated = !v.empty(); }},
+    {"weight", [](picture_group *g, const std::string &v) { g->weight = number_of<int64_t>(v, -1); }},
+    {"priority", [](picture_group *g, const std::string &v) { g->priority = number_of<int64_t>(v, -1); }},
+    {"policy_grp", [](picture_group *g, const std::string &v) { g->policy = number_of<int64_t>(v, -1); }},
+};
+
+static std::string group_root(const char *above, int id) {
+    return std::string(above) + "/" + std::to_string(id);
+}
+
+// What is configured; the addresses of its routers go to `out_routers`.
+static bool gather_config(gathering *work, picture_group *group, std::vector<std::string> *out_routers) {
+    ctl_reply reply;
+    const std::string root = group_root(CONFIGS, group->id);
+    if (!work->ask(ctl_walk::subtree, root, &reply))
+        return false;
+    for (const ctl_binding &binding : reply.bindings) {
+        const std::vector<std::string> parts = parts_below(root, binding.name);
+        if (parts.size() == 1)
+            take_node(config_rows, parts[0], binding.value, group);
+        else if (parts.size() == 3 && parts[0] == "router" && parts[2] == "ipaddr" &&
+                 out_routers->size() < ROUTERS_MAX / 2)
+            out_routers->push_back(clean_text(binding.value, 15));
+    }
+    return true;
+}
+
+static void take_load(picture_group *group, picture_router *router, const std::string &address,
+                      const std::string &value) {
+    if (router->loads.size() >= APPLIANCES_MAX)
+        return;
+    const picture_load load = {clean_text(address, 15), number_of<uint32_t>(value, 0)};
+    router->loads.push_back(load);
+    const int place = appliance_place(group, load.appliance);
+    if (place < 0)
+        return;
+    picture_appliance *one = &group->appliances[static_cast<size_t>(place)];
+    one->least_percent = one->reported ? std::min(one->least_percent, load.percent) : load.percent;
+    one->most_percent = std::max(one->most_percent, load.percent);
+    one->reported = true;
+}
+
+static uint32_t address_order(const std::string &address) {
+    in_addr parsed = {};
+    return inet_pton(AF_INET, address.c_str(), &parsed) == 1 ? ntohl(parsed.s_addr) : 0;
+}
+
+static bool gather_routers(gathering *work, picture_group *group,
+                           const std::vector<std::string> &configured) {
+    ctl_reply reply;
+    const std::string root = group_root(STATES, group->id) + "/router";
+    if (group->running && !work->ask_wccpd(ctl_walk::subtree, root, &reply))
+        return false;
+    std::string number;
+    for (const ctl_binding &binding : reply.bindings) {
+        const std::vector<std::string> parts = parts_below(root, binding.name);
+        if (parts.size() != 2 && !(parts.size() == 4 && parts[1] == "appliance"))
+            continue;
+        if (group->routers.empty() || parts[0] != number) {
+            if (group->routers.size() >= ROUTERS_MAX / 2)
+                break;
+            number = parts[0];
+            group->routers.emplace_back();
+        }
+        if (parts.size() == 2)
+            take_node(router_rows, parts[1], binding.value, &group->routers.back());
+        else if (parts[3] == "load_dist")
+            take_load(group, &group->routers.back(), parts[2], binding.value);
+    }
+    // wccpd's numbers change with each that comes or goes; a place on the screen shouldn't.
+    std::sort(group->routers.begin(), group->routers.end(), [](const auto &a, const auto &b) {
+        return address_order(a.address) < address_order(b.address);
+    });
+    for (const std::string &address : configured) {
+        const auto heard = std::find_if(group->routers.begin(), group->routers.end(),
+                                        [&](const picture_router &r) { return r.address == address; });
+        // A multicast address is where routers are looked for, and none itself.
+        if (heard != group->routers.end()) {
+            heard->configured = true;
+        } else if (const int first = number_of(address, 0); first < 224 || group->routers.empty()) {
+            picture_router silent;
+            silent.address = silent.id = address;
+            silent.configured = true;
+            silent.connection = "none";
+            group->routers.push_back(silent);
+        }
+    }
+    return true;
+}
+
+static bool gather_weights(gathering *work, picture_group *group, uint32_t count) {
+    for (uint32_t n = 1; n <= std::min<uint32_t>(count, APPLIANCES_MAX); n++) {
+        const std::string root = group_root(STATES, group->id) + "/appliance/" + std::to_string(n);
+        ctl_reply address, weight;
+        if (!work->ask_wccpd(ctl_walk::node, root + "/ipaddr", &address) ||
+            !work->ask_wccpd(ctl_walk::node, root + "/weight", &weight))
+            return false;
+        if (address.bindings.empty() || weight.bindings.empty() || address.bindings[0].value == "0.0.0.0")
+            continue;
+        const int place = appliance_place(group, clean_text(address.bindings[0].value, 15));
+        if (place >= 0)
+            group->appliances[static_cast<size_t>(place)].weight =
+                number_of<int64_t>(weight.bindings[0].value, -1);
+    }
+    return true;
+}
+
+// Where the designated appliance doesn't tell what it allots, the weights do.
+static void finish_shares(picture_group *group) {
+    int64_t sum = 0;
+    bool known = !group->appliances.empty();
+    for (const picture_appliance &one : group->appliances) {
+        known = known && one.weight >= 0 && one.asked_percent < 0;
+        sum += std::max<int64_t>(one.weight, 0);
+    }
+    for (picture_appliance &one : group->appliances)
+        if (known && sum > 0)
+            one.asked_percent = static_cast<int>((one.weight * 100 + sum / 2) / sum);
+}
+
+// By address: an appliance keeps its letter and its place while others come and go.
+static void sort_appliances(picture_group *group) {
+    std::vector<picture_appliance> sorted = group->appliances;
+    std::sort(sorted.begin(), sorted.end(), [](const auto &a, const auto &b) {
+        return address_order(a.address) < address_order(b.address);
+    });
+    group->appliances.swap(sorted);
+    for (picture_table &table : group->tables)
+        for (int &owner : table.owners)
+            if (owner >= 0)
+                owner = appliance_place(group, sorted[static_cast<size_t>(owner)].address);
+}
+
+namespace {
+struct group_texts {
+    std::string group, assignment;
+    uint32_t appliances = 0;
+};
+} // namespace
+
+static void take_group_nodes(const std::string &root, const ctl_reply &reply, picture_group *group,
+                             group_texts *out) {
+    for (const ctl_binding &binding : reply.bindings) {
+        const std::vector<std::string> parts = parts_below(root, binding.name);
+        if (parts.size() != 1)
+            continue;
+        take_node(group_rows, parts[0], binding.value, group);
+        if (parts[0] == "num_appliances")
+            out->appliances = number_of<uint32_t>(binding.value, 0);
+        else if (parts[0] == "debug")
+            out->group = binding.value;
+        else if (parts[0] == "assignment")
+            out->assignment = binding.value;
+    }
+}
+
+static bool gather_briefly(gathering *work, picture_group *group, const std::string &root) {
+    ctl_reply reply;
+    group_texts unused;
+    for (const char *node : {"/oper", "/uptime", "/app_id", "/num_routers"}) {
+        if (!work->ask_wccpd(ctl_walk::node, root + node, &reply))
+            return false;
+        take_group_nodes(root, reply, group, &unused);
+    }
+    if (group->routers_heard == 0)
+        return true;
+    if (!work->ask_wccpd(ctl_walk::node, root + "/router/1/appliance/" + group->address + "/load_dist",
+                         &reply))
+        return false;
+    if (!reply.bindings.empty()) {
+        picture_router first;
+        take_load(group, &first, group->address, reply.bindings[0].value);
+    }
+    return true;
+}
+
+static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
+    std::vector<std::string> configured;
+    if (group->configured && !gather_config(work, group, &configured))
+        return false;
+    group->routers_configured = configured.size();
+    const std::string root = group_root(STATES, group->id);
+    if (work->shown.brief)
+        return !in_wccpd || gather_briefly(work, group, root);
+    ctl_reply reply;
+    group_texts texts;
+    if (in_wccpd && !work->ask_wccpd(ctl_walk::children, root, &reply))
+        return false;
+    take_group_nodes(root, reply, group, &texts);
+    if (!gather_routers(work, group, configured) || !gather_weights(work, group, texts.appliances))
+        return false;
+    take_group_text(texts.group, group);
+    take_assignment_text(texts.assignment, group);
+    finish_shares(group);
+    sort_appliances(group);
+    return true;
+}
+
+static bool gather_alarms(gathering *work) {
+    ctl_reply reply;
+    if (!work->ask(ctl_walk::subtree, ALARM_ROOT, &reply))
+        return false;
+    const std::vector<ctl_alarm> standing = alarms_of(reply.bindings);
+    work->shown.alarms_total = standing.size();
+    for (size_t i = 0; i < std::min(standing.size(), work->limits.alarms); i++) {
+        const ctl_alarm &from = standing[i];
+        const size_t at = from.source.rfind(":grp:");
+        work->shown.alarms.push_back(
+            {number_of<long>(from.type, 0), clean_text(from.name, 31), clean_text(from.source, 63),
+             clean_text(from.text, 127), clean_text(from.since, 31), clean_text(from.reporter, 63),
+             at == std::string::npos ? -1 : number_of(from.source.substr(at + 5), -1)});
+    }
+    if (!work->ask(ctl_walk::children, ROLES, &reply))
+        return false;
+    for (const ctl_binding &binding : reply.bindings) {
+        work->shown.roles_active += binding.value == "ACTIVE";
+        work->shown.roles_backup += binding.value == "BACKUP";
+    }
+    return true;
+}
+
+static std::string first_value(const ctl_reply &reply) {
+    return reply.bindings.empty() ? "" : clean_text(reply.bindings[0].value, 31);
+}
+
+// The ids of the groups below a root, as they stand in a walk of its children.
+static void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *inout) {
+    for (const ctl_binding &binding : reply.bindings) {
+        const std::vector<std::string> parts = parts_below(root, binding.name);
+        const int id = parts.size() == 1 ? number_of(parts[0], -1) : -1;
+        if (id >= 0 && id <= 255 && inout->size() < 256)
+            inout->push_back(id);
+    }
+    std::sort(inout->begin(), inout->end());
+}
+
+static void gather(gathering *work) {
+    ctl_reply alive, mode, states, configs;
+    work->shown.wccpd = picture_wccpd::running;
+    if (!work->ask(ctl_walk::node, "/qv/tunneld/system/config/mode", &mode) || !gather_alarms(work) ||
+        !work->ask(ctl_walk::children, CONFIGS, &configs) ||
+        !work->ask_wccpd(ctl_walk::node, "/qv/wccpd/system/state/is_alive", &alive) ||
+        !work->ask_wccpd(ctl_walk::children, STATES, &states))
+        return;
+    work->shown.mode = first_value(mode);
+    work->shown.status = first_value(alive);
+    std::vector<int> configured, running, all;
+    add_ids(CONFIGS, configs, &configured);
+    add_ids(STATES, states, &running);
+    std::set_union(configured.begin(), configured.end(), running.begin(), running.end(),
+                   std::back_inserter(all));
+    work->shown.groups_total = all.size();
+    work->shown.brief = all.size() > work->limits.detailed;
+    for (const int id : all) {
+        if (work->queries >= work->limits.queries ||
+            (work->shown.brief && work->shown.groups.size() >= work->limits.listed))
+            return;
+        picture_group group;
+        group.id = id;
+        group.configured = std::binary_search(configured.begin(), configured.end(), id);
+        if (!gather_group(work, &group, std::binary_search(running.begin(), running.end(), id)))
+            return;
+        work->shown.groups.push_back(std::move(group));
+    }
+}
+
+picture gather_picture(const picture_query &query, const picture_limits &limits) {
+    gathering work = {query, limits, {}, 0};
+    gather(&work);
+    return std::move(work.shown);
+}

@@ -1,0 +1,421 @@
+// The picture on a terminal, or in a file of plain lines.
+//
+// Colour says nothing that a letter or a word doesn't say too. Each appliance has a letter and a colour
+// within its group; the strip shows who has the buckets of a table, two halves in a cell where the terminal
+// can, and a bar shows the share that the routers report beside the share asked for.
+//
+// What doesn't fit is shortened in steps: fewer routers and appliances of each group, those in trouble first;
+// then one line for a group; then the groups end with how many are not shown.
+#include <algorithm>
+#include <cinttypes>
+#include <cstdarg>
+#include <cstdio>
+#include <cstring>
+
+#include "peers/mgmtctl/show_picture.h"
+
+static constexpr int STRIP_CELLS = 64;
+static constexpr int BAR_CELLS = 20;
+
+namespace {
+enum class style { plain, bold, dim, good, warn, bad };
+
+// A line that ends at its last column, whatever is added.
+struct pen {
+    const screen_form &form;
+    std::string out;
+    int used = 0;
+};
+} // namespace
+
+static void set_style(pen *line, const std::string &codes) {
+    if (line->form.colour)
+        line->out += "\033[" + codes + "m";
+}
+
+// One column wide each; `text` is ASCII.
+static void add_cells(pen *line, const std::string &text, style how = style::plain) {
+    static const char *const codes[] = {"", "1", "2", "32", "33", "1;31"};
+    const char *code = codes[static_cast<int>(how)];
+    const auto room = static_cast<size_t>(std::max(line->form.columns - line->used, 0));
+    const std::string shown = text.substr(0, room);
+    const bool styled = *code && !shown.empty();
+    if (styled)
+        set_style(line, code);
+    line->out += shown;
+    line->used += static_cast<int>(shown.size());
+    if (styled)
+        set_style(line, "0");
+}
+
+static void add_glyph(pen *line, const char *utf8, char ascii) {
+    if (line->used >= line->form.columns)
+        return;
+    if (line->form.utf8)
+        line->out += utf8;
+    else
+        line->out += ascii;
+    line->used++;
+}
+
+static std::string format(const char *text, ...) __attribute__((format(printf, 1, 2)));
+static std::string format(const char *text, ...) {
+    char buffer[256];
+    va_list list;
+    va_start(list, text);
+    vsnprintf(buffer, sizeof buffer, text, list);
+    va_end(list);
+    return buffer;
+}
+
+std::string duration_text(uint64_t milliseconds) {
+    const uint64_t seconds = milliseconds / 1000, days = seconds / 86400;
+    const std::string days_text = days ? std::to_string(days) + "d " : "";
+    return days_text + format("%" PRIu64 ":%02" PRIu64 ":%02" PRIu64, seconds / 3600 % 24, seconds / 60 % 60,
+                              seconds % 60);
+}
+
+static char letter_of(int place) {
+    return place < 0 ? '-' : static_cast<char>(place < 26 ? 'A' + place : 'a' + place - 26);
+}
+
+static int colour_of(int place) {
+    static const int palette[] = {33, 214, 70, 170, 44, 203, 142, 105, 37, 208, 28, 161};
+    return place < 0 ? 236 : palette[static_cast<size_t>(place) % std::size(palette)];
+}
+
+static std::string plural(size_t count, const char *what) {
+    return std::to_string(count) + " " + what + (count == 1 ? "" : "s");
+}
+
+// --- Words
+
+static std::string alarm_words(const picture_alarm &alarm) {
+    static const struct {
+        const char *name, *words;
+    } known[] = {
+        {"adjacency", "a router is not connected as it should be"},
+        {"assignment", "a router does not share out the traffic as asked"},
+    };
+    std::string text = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": " : alarm.source + ": ";
+    const auto *row = std::find_if(std::begin(known), std::end(known),
+                                   [&](const auto &each) { return alarm.name == each.name; });
+    text += row != std::end(known) ? row->words : alarm.text;
+    return alarm.since.empty() ? text : text + ", since " + alarm.since;
+}
+
+static bool in_alarm(const picture &shown, const picture_group &group) {
+    return std::any_of(shown.alarms.begin(), shown.alarms.end(),
+                       [&](const picture_alarm &alarm) { return alarm.group == group.id; });
+}
+
+static std::pair<std::string, style> state_words(const picture &shown, const picture_group &group) {
+    if (group.admin == "down")
+        return {"admin down", style::dim};
+    if (!group.running)
+        return {shown.wccpd == picture_wccpd::running ? "not taken by wccpd" : "configured", style::warn};
+    std::string text = group.state + (group.designated ? ", designated" : "");
+    if (!group.configured)
+        text += ", not configured";
+    if (group.link == "down")
+        return {text + ", link down", style::bad};
+    return {text, group.state == "INIT" ? style::warn : style::good};
+}
+
+static const picture_appliance *own(const picture_group &group) {
+    const auto self = std::find_if(group.appliances.begin(), group.appliances.end(),
+                                   [](const picture_appliance &one) { return one.self; });
+    return self == group.appliances.end() ? nullptr : &*self;
+}
+
+static std::string share_words(const picture_appliance &one) {
+    if (!one.reported)
+        return "-";
+    std::string text = std::to_string(one.least_percent);
+    if (one.most_percent != one.least_percent)
+        text += "-" + std::to_string(one.most_percent);
+    return text + "%";
+}
+
+static size_t connected_routers(const picture_group &group) {
+    return static_cast<size_t>(std::count_if(group.routers.begin(), group.routers.end(),
+                                             [](const auto &r) { return r.connection == "two-way"; }));
+}
+
+static std::string one_line(const picture_group &group, bool brief) {
+    const size_t reached = brief ? group.routers_heard : connected_routers(group);
+    const size_t all = brief ? std::max(group.routers_configured, reached) : group.routers.size();
+    std::string text = "  routers " + std::to_string(reached) + "/" + std::to_string(all);
+    if (const picture_appliance *self = own(group)) {
+        text += "  share " + share_words(*self);
+        if (self->asked_percent >= 0)
+            text += " of " + std::to_string(self->asked_percent) + "%";
+    }
+    if (!group.address.empty() && group.address != "0.0.0.0")
+        text += "  " + group.address;
+    return text;
+}
+
+std::vector<std::string> draw_lines(const picture &shown) {
+    if (!shown.unreachable.empty())
+        return {"mgmtd: " + shown.unreachable};
+    std::vector<std::string> out;
+    if (shown.wccpd != picture_wccpd::running)
+        out.emplace_back(shown.wccpd == picture_wccpd::absent ? "wccpd is not running"
+                                                              : "wccpd does not answer");
+    for (const picture_alarm &alarm : shown.alarms)
+        out.push_back("alarm  " + alarm_words(alarm));
+    for (const picture_group &group : shown.groups)
+        out.push_back("group " + std::to_string(group.id) + "  " + state_words(shown, group).first +
+                      one_line(group, shown.brief));
+    return out;
+}
+
+// --- The screen
+
+namespace {
+struct screen {
+    const picture &shown;
+    const screen_form &form;
+    std::vector<std::string> lines;
+
+    pen begin() const { return {form, "", 0}; }
+    void end(pen *line) { lines.push_back(std::move(line->out)); }
+    void text(const std::string &words, style how = style::plain) {
+        pen line = begin();
+        add_cells(&line, words, how);
+        end(&line);
+    }
+};
+} // namespace
+
+static std::string group_counts(const picture &shown) {
+    size_t active = shown.roles_active, backup = shown.roles_backup;
+    if (!shown.brief) {
+        active = backup = 0;
+        for (const picture_group &group : shown.groups) {
+            active += group.state == "ACTIVE";
+            backup += group.state == "BACKUP";
+        }
+    }
+    std::string text = shown.groups_total == 0 ? "no group" : plural(shown.groups_total, "group");
+    if (shown.groups_total != 0 && shown.wccpd == picture_wccpd::running)
+        text += ": " + std::to_string(active) + " active" +
+                (backup ? ", " + std::to_string(backup) + " backup" : "");
+    return text;
+}
+
+static void draw_head(screen *on, size_t alarms_most) {
+    const picture &shown = on->shown;
+    pen line = on->begin();
+    if (!shown.unreachable.empty()) {
+        add_cells(&line, "mgmtd: " + shown.unreachable, style::bad);
+        add_cells(&line, on->form.corner, style::dim);
+        on->end(&line);
+        return;
+    }
+    if (shown.wccpd == picture_wccpd::running)
+        add_cells(&line, "wccpd " + (shown.status.empty() ? "runs" : shown.status), style::bold);
+    else
+        add_cells(&line,
+                  shown.wccpd == picture_wccpd::absent ? "wccpd is not running" : "wccpd does not answer",
+                  style::bad);
+    if (!shown.mode.empty())
+        add_cells(&line, "   mode " + shown.mode);
+    add_cells(&line, "   " + group_counts(shown) + "   ");
+    add_cells(&line, shown.alarms_total ? plural(shown.alarms_total, "alarm") : "no alarm",
+              shown.alarms_total ? style::bad : style::plain);
+    add_cells(&line, on->form.corner, style::dim);
+    on->end(&line);
+    const size_t told = std::min(shown.alarms.size(), alarms_most);
+    for (size_t i = 0; i < told; i++)
+        on->text("! " + alarm_words(shown.alarms[i]), style::bad);
+    if (told < shown.alarms_total)
+        on->text("! " + plural(shown.alarms_total - told, "alarm") + (told ? " more" : ""), style::bad);
+}
+
+static void draw_group_head(screen *on, const picture_group &group) {
+    pen line = on->begin();
+    add_cells(&line, format("%-4d", group.id), style::bold);
+    const auto [words, how] = state_words(on->shown, group);
+    add_cells(&line, words, how);
+    if (in_alarm(on->shown, group))
+        add_cells(&line, " !", style::bad);
+    std::string text;
+    if (group.uptime_ms)
+        text += "  up " + duration_text(group.uptime_ms);
+    if (!group.address.empty() && group.address != "0.0.0.0")
+        text += "  " + group.address + (group.interface.empty() ? "" : " on " + group.interface);
+    else if (!group.interface.empty())
+        text += "  on " + group.interface;
+    if (!group.protocol.empty())
+        text += "  " + group.protocol;
+    if (group.weight >= 0)
+        text += format("  weight %" PRId64, group.weight);
+    if (group.authenticated)
+        text += "  md5";
+    if (group.policy >= 0)
+        text += format("  policy %" PRId64, group.policy);
+    add_cells(&line, text);
+    on->end(&line);
+}
+
+static void draw_router(screen *on, const picture_router &router) {
+    const auto method = [](const std::string &word) { return word.empty() ? "-" : word.c_str(); };
+    pen line = on->begin();
+    add_cells(&line, format("  router %-15s ", router.address.c_str()));
+    if (router.connection == "none") {
+        add_cells(&line, "nothing heard", style::bad);
+    } else {
+        add_cells(&line, format("%-7s", router.connection.c_str()),
+                  router.connection == "two-way" ? style::good : style::warn);
+        add_cells(&line, format("  %8s  fwd %-3s  assign %-4s  return %-3s",
+                                duration_text(router.connected_ms).c_str(), method(router.forward),
+                                method(router.assign), method(router.back)));
+        if (router.id != router.address)
+            add_cells(&line, "  id " + router.id, style::dim);
+    }
+    on->end(&line);
+}
+
+static void draw_bar(pen *line, const picture_appliance &one, int place) {
+    const int has = static_cast<int>(std::min<uint32_t>(one.least_percent, 100)) * BAR_CELLS;
+    const int asked = std::clamp(one.asked_percent, 0, 100) * BAR_CELLS;
+    set_style(line, "38;5;" + std::to_string(colour_of(place)));
+    for (int i = 0; i < BAR_CELLS; i++) {
+        const int middle = i * 100 + 50; // of the cell, in hundredths
+        if (middle <= has && (middle <= asked || one.asked_percent < 0))
+            add_glyph(line, "█", '#');
+        else if (middle <= has)
+            add_glyph(line, "▓", '+');
+        else if (middle <= asked)
+            add_glyph(line, "░", '.');
+        else
+            break;
+    }
+    set_style(line, "0");
+}
+
+static void draw_appliance(screen *on, const picture_appliance &one, int place) {
+    pen line = on->begin();
+    add_cells(&line, "  ");
+    set_style(&line, "1;38;5;" + std::to_string(colour_of(place)));
+    add_cells(&line, std::string(1, letter_of(place)));
+    set_style(&line, "0");
+    add_cells(&line, format(" %-15s %-4s ", one.address.c_str(), one.self ? "this" : ""));
+    add_cells(&line, one.weight < 0 ? format("%-13s", "") : format("weight %-6" PRId64, one.weight));
+    add_cells(&line, one.asked_percent < 0 ? format("%-11s", "") : format("asked %3d%% ", one.asked_percent));
+    const bool short_of = one.reported && one.asked_percent >= 0 &&
+                          std::abs(static_cast<int>(one.least_percent) - one.asked_percent) > 1;
+    add_cells(&line, format("has %-7s ", share_words(one).c_str()), short_of ? style::warn : style::plain);
+    draw_bar(&line, one, place);
+    on->end(&line);
+}
+
+static void draw_strip(screen *on, const picture_group &group, const picture_table &table) {
+    std::string label = table.mask ? "mask" : "hash";
+    if (group.tables.size() > 1) // which of them
+        label = table.routers[0] + (table.routers.size() > 1 ? " .." : "");
+    pen line = on->begin();
+    add_cells(&line, "  " + label + " ");
+    const int cells = std::clamp(on->form.columns - line.used, 0, STRIP_CELLS);
+    const auto owner_at = [&](int half) {
+        return table.owners[static_cast<size_t>(half) * table.owners.size() / static_cast<size_t>(2 * cells)];
+    };
+    std::string before;
+    for (int i = 0; i < cells; i++) {
+        const int left = owner_at(2 * i), right = owner_at(2 * i + 1);
+        const std::string codes = (on->form.utf8 ? "38;5;" + std::to_string(colour_of(left)) : "30") +
+                                  ";48;5;" + std::to_string(colour_of(on->form.utf8 ? right : left));
+        if (codes != before)
+            set_style(&line, codes);
+        before = codes;
+        if (on->form.colour && on->form.utf8)
+            add_glyph(&line, "▌", ' ');
+        else
+            add_cells(&line, std::string(1, letter_of(left)));
+    }
+    set_style(&line, "0");
+    on->end(&line);
+}
+
+// The places of up to `most` entries, those for which `first` holds before the others.
+template <typename Entry, typename First>
+static std::vector<size_t> chosen(const std::vector<Entry> &all, size_t most, First first) {
+    std::vector<size_t> out;
+    for (const bool wanted : {true, false})
+        for (size_t i = 0; i < all.size() && out.size() < most; i++)
+            if (first(all[i]) == wanted)
+                out.push_back(i);
+    if (out.size() == all.size())
+        std::sort(out.begin(), out.end());
+    return out;
+}
+
+static void draw_more(screen *on, size_t all, size_t most, const char *what) {
+    if (all > most)
+        on->text("  and " + plural(all - most, what) + " more", style::dim);
+}
+
+static void draw_group(screen *on, const picture_group &group, size_t most) {
+    draw_group_head(on, group);
+    for (const size_t i :
+         chosen(group.routers, most, [](const auto &r) { return r.connection != "two-way"; }))
+        draw_router(on, group.routers[i]);
+    draw_more(on, group.routers.size(), most, "router");
+    for (const size_t i : chosen(group.appliances, most, [](const auto &one) { return one.self; }))
+        draw_appliance(on, group.appliances[i], static_cast<int>(i));
+    draw_more(on, group.appliances.size(), most, "appliance");
+    for (size_t i = 0; i < std::min(group.tables.size(), most); i++)
+        draw_strip(on, group, group.tables[i]);
+    draw_more(on, group.tables.size(), most, "table");
+}
+
+static std::vector<std::string> draw_whole(const picture &shown, const screen_form &form, size_t most) {
+    screen on = {shown, form, {}};
+    draw_head(&on, most);
+    for (const picture_group &group : shown.groups) {
+        on.text("");
+        draw_group(&on, group, most);
+    }
+    if (shown.groups.size() < shown.groups_total)
+        on.text("and " + plural(shown.groups_total - shown.groups.size(), "group") + " not shown",
+                style::dim);
+    return std::move(on.lines);
+}
+
+static std::vector<std::string> draw_briefly(const picture &shown, const screen_form &form) {
+    screen on = {shown, form, {}};
+    draw_head(&on, 3);
+    size_t told = 0;
+    for (const picture_group &group : shown.groups) {
+        const size_t last = told + 1 < shown.groups_total ? 1 : 0; // the line that tells of the others
+        if (form.rows > 0 && on.lines.size() + 1 + last > static_cast<size_t>(form.rows))
+            break;
+        pen line = on.begin();
+        add_cells(&line, format("%-4d", group.id), style::bold);
+        const auto [words, how] = state_words(shown, group);
+        add_cells(&line, format("%-20s", words.c_str()), how);
+        add_cells(&line, in_alarm(shown, group) ? " !" : "  ", style::bad);
+        add_cells(&line, group.uptime_ms ? format("  up %-11s", duration_text(group.uptime_ms).c_str()) : "");
+        add_cells(&line, one_line(group, shown.brief));
+        on.end(&line);
+        told++;
+    }
+    if (told < shown.groups_total)
+        on.text("and " + plural(shown.groups_total - told, "group") + " not shown", style::dim);
+    return std::move(on.lines);
+}
+
+std::vector<std::string> draw_screen(const picture &shown, const screen_form &form) {
+    if (!shown.brief)
+        for (const size_t most : {size_t{256}, size_t{16}, size_t{8}, size_t{4}, size_t{2}, size_t{1}}) {
+            std::vector<std::string> lines = draw_whole(shown, form, most);
+            if (form.rows <= 0 || lines.size() <= static_cast<size_t>(form.rows))
+                return lines;
+        }
+    std::vector<std::string> lines = draw_briefly(shown, form);
+    if (form.rows > 0 && lines.size() > static_cast<size_t>(form.rows))
+        lines.resize(static_cast<size_t>(form.rows));
+    return lines;
+}

@@ -1,0 +1,249 @@
+// The watch: interests in everything that mgmtd tells of, and each event as a line or as JSON the moment it
+// comes.
+//
+// A change event carries its changes as numbered entries, each of some bindings (kind, name, value after and
+// before). They come sorted by entry, and are told in that order.
+//
+// With names the watch is one of these nodes alone. The wait is cut into seconds to look whether anybody
+// still reads: an event that nobody gets to see may be a long time away.
+#include "peers/mgmtctl/watch.h"
+
+#include <cstdio>
+#include <ctime>
+#include <map>
+
+#include <poll.h>
+#include <unistd.h>
+
+#include "peers/nodes/binding_text.h"
+#include "peers/nodes/schema.h"
+
+static constexpr int64_t LOOK_MS = 1000;
+
+namespace {
+struct change_entry {
+    std::string kind, name;
+    ctl_binding before, after; // without a type: there is none
+};
+// What an event is called here, and the words of its line.
+struct event_row {
+    const char *event, *name, *words;
+    ctl_json (*json)(const event_row &row, const ctl_event &event);
+    std::string (*text)(const event_row &row, const ctl_event &event);
+};
+} // namespace
+
+static std::string value_of(const ctl_event &event, const char *name) {
+    for (const ctl_binding &binding : event.bindings)
+        if (binding.name == name)
+            return binding.value;
+    return "";
+}
+
+static std::vector<change_entry> changes_of(const ctl_event &event) {
+    std::map<node_name, change_entry> entries;
+    for (const ctl_binding &binding : event.bindings) {
+        node_name name;
+        if (!parse_node_name(binding.name, &name) || name.parts.size() < 4)
+            continue;
+        const std::string what = name.parts.size() == 4 ? "" : name.parts[4];
+        name.parts.resize(4);
+        change_entry &entry = entries[name];
+        if (what == "change_type")
+            entry.kind = binding.value;
+        else if (what == "name")
+            entry.name = binding.value;
+        else if (what == "new_attribs")
+            entry.after = binding;
+        else if (what == "prev_attribs")
+            entry.before = binding;
+    }
+    std::vector<change_entry> out;
+    for (auto &[number, entry] : entries) {
+        entry.before.name = entry.after.name = entry.name; // a secret shows by its name
+        out.push_back(std::move(entry));
+    }
+    return out;
+}
+
+// --- Reports
+
+static ctl_json number(const std::string &text) {
+    return json_value({"", "int64", text});
+}
+
+static ctl_json alarm_json(const event_row &row, const ctl_event &event) {
+    const std::string type = value_of(event, "alarm_type");
+    return {{"event", row.name},
+            {"type", number(type)},
+            {"name", alarm_name(type)},
+            {"source", value_of(event, "param_3")},
+            {"text", value_of(event, "comment")}};
+}
+static std::string alarm_text(const event_row &row, const ctl_event &event) {
+    return std::string(row.words) + value_of(event, "param_3") + " " + value_of(event, "comment");
+}
+
+static ctl_json role_json(const event_row &row, const ctl_event &event) {
+    return {{"event", row.name},
+            {"group", number(value_of(event, "group"))},
+            {"role", role_name(value_of(event, "role"))},
+            {"code", number(value_of(event, "code"))}};
+}
+static std::string role_text(const event_row &row, const ctl_event &event) {
+    return row.words + value_of(event, "group") + ": " + role_name(value_of(event, "role"));
+}
+
+static std::string process_of(const ctl_event &event) {
+    return event.bindings.empty() ? "" : event.bindings[0].value;
+}
+static ctl_json process_json(const event_row &row, const ctl_event &event) {
+    return {{"event", row.name}, {"process", process_of(event)}};
+}
+static std::string process_text(const event_row &row, const ctl_event &event) {
+    return "process " + process_of(event) + row.words;
+}
+
+static ctl_json plain_json(const event_row &row, const ctl_event &) {
+    return {{"event", row.name}};
+}
+static std::string plain_text(const event_row &row, const ctl_event &) {
+    return row.words;
+}
+
+static const event_row rows[] = {
+    {"/qv/alarms/events/raise_alarm", "alarm_raised", "alarm raised: ", alarm_json, alarm_text},
+    {"/qv/alarms/events/clear_alarm", "alarm_cleared", "alarm cleared: ", alarm_json, alarm_text},
+    {"/qv/state/events/role_change", "role", "role of group ", role_json, role_text},
+    {"/pm/events/failure/crash", "process_crash", " crashed", process_json, process_text},
+    {"/pm/events/failure/unexpected_exit", "process_exit", " ended unexpectedly", process_json, process_text},
+    {"/pm/events/proc/terminate", "process_terminate", " was terminated", process_json, process_text},
+    {"/time/notify/zonechange", "timezone", "the time zone has changed", plain_json, plain_text},
+};
+
+static const event_row *find_row(const ctl_event &event) {
+    for (const event_row &row : rows)
+        if (event.name == row.event)
+            return &row;
+    return nullptr;
+}
+
+// --- Forms
+
+static ctl_json json_side(const ctl_binding &side, bool secrets) {
+    return side.type.empty() ? ctl_json(nullptr) : json_node(side, secrets)["value"];
+}
+
+ctl_json json_event(const ctl_event &event, bool secrets) {
+    if (event.name == CHANGE_EVENT) {
+        ctl_json changes = ctl_json::array();
+        for (const change_entry &entry : changes_of(event))
+            changes.push_back({{"name", entry.name},
+                               {"change", entry.kind},
+                               {"type", entry.after.type.empty() ? entry.before.type : entry.after.type},
+                               {"before", json_side(entry.before, secrets)},
+                               {"after", json_side(entry.after, secrets)}});
+        return {{"event", "change"}, {"changes", changes}};
+    }
+    if (const event_row *row = find_row(event))
+        return row->json(*row, event);
+    ctl_json bindings = ctl_json::array();
+    for (const ctl_binding &binding : event.bindings)
+        bindings.push_back(json_node(binding, secrets));
+    return {{"event", event.name}, {"bindings", bindings}};
+}
+
+std::vector<std::string> text_event(const ctl_event &event, bool secrets) {
+    if (event.name == CHANGE_EVENT) {
+        std::vector<std::string> out;
+        for (const change_entry &entry : changes_of(event)) {
+            std::string line = entry.kind + std::string(entry.kind == "add" ? "    " : " ") + entry.name;
+            if (!entry.after.type.empty())
+                line += " = " + shown_value(entry.after, secrets);
+            if (!entry.before.type.empty())
+                line += " (was " + shown_value(entry.before, secrets) + ")";
+            out.push_back(line);
+        }
+        return out;
+    }
+    const event_row *row = find_row(event);
+    return {row ? row->text(*row, event) : "event " + event.name};
+}
+
+// --- The word
+
+std::vector<std::string> watched_events() {
+    std::vector<std::string> out = {CHANGE_EVENT};
+    for (const event_row &row : rows)
+        out.emplace_back(row.event);
+    return out;
+}
+
+std::string watch_pattern(const std::string &name) {
+    if (name == "/")
+        return "/**";
+    return name.find('*') != std::string::npos ? name : name + "/**";
+}
+
+static std::string time_text(const char *format) {
+    const time_t now = time(nullptr);
+    tm broken{};
+    char text[64];
+    localtime_r(&now, &broken);
+    return {text, strftime(text, sizeof text, format, &broken)};
+}
+
+static void tell(const ctl_options &options, const ctl_event &event) {
+    if (options.json) {
+        ctl_json out = {{"time", time_text("%FT%T%z")}};
+        out.update(json_event(event, options.secrets));
+        put(json_line(out));
+    } else {
+        const std::string now = time_text("%T ");
+        for (const std::string &line : text_event(event, options.secrets))
+            put(now + line + "\n");
+    }
+}
+
+static bool anybody_reads() {
+    pollfd out = {STDOUT_FILENO, 0, 0};
+    return fflush(stdout) == 0 && !(poll(&out, 1, 0) == 1 && (out.revents & POLLERR));
+}
+
+static int follow(const ctl_options &options, ctl_session *session, const std::vector<std::string> &names,
+                  uint64_t count) {
+    std::vector<std::string> patterns;
+    for (const std::string &name : names)
+        patterns.push_back(watch_pattern(name));
+    std::string reason;
+    for (const std::string &event : watched_events()) {
+        if (event != CHANGE_EVENT && !names.empty())
+            break;
+        if (!ctl_add_interest(session, event, patterns, &reason))
+            return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});
+    }
+    for (uint64_t seen = 0; (count == 0 || seen < count) && !ctl_stop_signal && anybody_reads();) {
+        ctl_event event;
+        const int got = ctl_next_event(session, LOOK_MS, &event, &reason);
+        if (got < 0)
+            return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});
+        if (got == 0)
+            continue;
+        tell(options, event);
+        seen++;
+    }
+    return CTL_OK;
+}
+
+int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count) {
+    std::string reason;
+    for (const std::string &name : names)
+        if (node_name parsed; !parse_node_name(watch_pattern(name), &parsed))
+            return tell_failure(options, {CTL_USAGE, name, "is no name of a node", "", 0});
+    ctl_session *session = ctl_open(options.timeout_ms, &reason);
+    if (!session)
+        return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});
+    const int code = follow(options, session, names, count);
+    ctl_close(session);
+    return code;
+}

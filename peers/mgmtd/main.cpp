@@ -1,0 +1,134 @@
+// mgmtd [--config FILE] [--check] [--supervise [--wccpd PATH] [--tunneld PATH]]
+#include <algorithm>
+#include <climits>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+#include <ctime>
+
+#include <poll.h>
+#include <sys/signalfd.h>
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+
+#include "peers/mgmtd/supervise.h"
+#include "peers/mgmtd/transport.h"
+#include "runtime/common.h"
+#include "runtime/logging.h"
+#include "runtime/version.h"
+
+static constexpr uint32_t COMPONENT_MGMTD = 5u << 16;
+
+static int64_t monotonic_ms() {
+    timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
+}
+
+// Nobody has to read what is said: a pipe that is full, or a terminal that is held, loses lines and stops
+// nothing. Up to PIPE_BUF bytes fit whole wherever POLLOUT is told.
+static void say(const std::string &line) {
+    static uint64_t lost;
+    std::string text = lost ? "(" + std::to_string(lost) + " lines lost)\n" + line : line;
+    text.resize(std::min<size_t>(text.size(), PIPE_BUF - 1));
+    text += '\n';
+    pollfd out = {STDOUT_FILENO, POLLOUT, 0};
+    if (poll(&out, 1, 0) == 1 && (out.revents & POLLOUT) &&
+        write(STDOUT_FILENO, text.data(), text.size()) > 0)
+        lost = 0;
+    else
+        lost++;
+}
+
+static int block_signals() {
+    sigset_t set;
+    sigemptyset(&set);
+    for (const int number : {SIGTERM, SIGINT, SIGHUP, SIGCHLD})
+        sigaddset(&set, number);
+    sigprocmask(SIG_BLOCK, &set, nullptr);
+    signal(SIGPIPE, SIG_IGN);
+    return signalfd(-1, &set, SFD_NONBLOCK | SFD_CLOEXEC);
+}
+
+static void take_signals(int fd, server *daemon, supervisor *processes) {
+    signalfd_siginfo info;
+    while (read(fd, &info, sizeof info) == sizeof info) {
+        if (info.ssi_signo == SIGCHLD)
+            supervisor_reap(processes);
+        else if (info.ssi_signo == SIGHUP)
+            server_reload(daemon);
+        else
+            processes->ending = true;
+    }
+}
+
+static int64_t time_left(int64_t now, std::initializer_list<int64_t> due) {
+    int64_t left = -1;
+    for (const int64_t at : due)
+        if (at >= 0 && (left < 0 || at - now < left))
+            left = std::max<int64_t>(at - now, 0);
+    return left;
+}
+
+// NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
+int main(int argc, char **argv) {
+    std::string config = "/etc/mgmtd.conf", wccpd = "wccpd", tunneld = "tunneld";
+    bool check = false, supervise = false;
+    CLI::App app{"The management daemon: keeps the configuration, tells of its changes, asks for states."};
+    app.set_version_flag("--version", std::string("mgmtd ") + wccp_version());
+    app.add_option("--config", config, "the configuration file; it is written at each change")
+        ->capture_default_str();
+    app.add_flag("--check", check, "read the configuration file, tell what is wrong with it, and end");
+    app.add_flag("--supervise", supervise, "start tunneld and wccpd, and start them again when they end");
+    app.add_option("--wccpd", wccpd, "the program, with --supervise")->capture_default_str();
+    app.add_option("--tunneld", tunneld, "the program, with --supervise")->capture_default_str();
+    CLI11_PARSE(app, argc, argv);
+
+    lc_init();
+    lc_log_init("mgmtd", nullptr, 0, COMPONENT_MGMTD, LC_LOG_NOTICE, lc_log_get_facility(nullptr, "mgmtd"),
+                1);
+    server daemon;
+    std::string errors;
+    if (!config_load(config, &daemon.tree, &daemon.comments, &errors)) {
+        fputs(errors.c_str(), stderr);
+        return 1;
+    }
+    if (check)
+        return 0;
+    daemon.config_file = config;
+    daemon.now_ms = monotonic_ms;
+    daemon.say = say;
+
+    const int signals = block_signals();
+    transport sockets;
+    if (!transport_listen(&sockets, &daemon, &errors)) {
+        fprintf(stderr, "mgmtd: %s\n", errors.c_str());
+        transport_close(&sockets);
+        return 1;
+    }
+    say("mgmtd ready, " + std::to_string(daemon.tree.nodes.size()) + " nodes");
+
+    supervisor processes;
+    processes.now_ms = monotonic_ms;
+    processes.say = say;
+    processes.tell = [&](const std::string &event, const std::string &process) {
+        server_process_event(&daemon, event, process);
+    };
+    if (supervise) {
+        processes.children.push_back({"tunneld", {tunneld}});
+        processes.children.push_back({"wccpd", {wccpd}});
+    }
+    for (;;) {
+        const int64_t child_due = supervisor_tick(&processes);
+        if (processes.ending && supervisor_is_done(processes))
+            break;
+        const int64_t query_due = server_tick(&daemon);
+        if (transport_round(&sockets, signals, time_left(monotonic_ms(), {child_due, query_due})))
+            take_signals(signals, &daemon, &processes);
+    }
+    transport_close(&sockets);
+    say("mgmtd ended");
+    lc_log_close();
+    return 0;
+}

@@ -1,0 +1,218 @@
+// The tree and its commits.
+//
+// A commit works on a copy: the steps are carried out one by one, then the whole is checked, written to the
+// configuration file and only then takes the old tree's place. What goes to the sessions is the difference
+// of the two as they hold, defaults in them: a new group is its root and all of its children, and a node that
+// is deleted and has a default is a change back to that default.
+//
+// A child that is created brings the instance it belongs to along; a child of an instance that isn't there
+// can't be modified, so that a mistyped number makes no new group.
+#include "peers/mgmtd/node_tree.h"
+
+#include <bit>
+#include <set>
+
+#include "mgmt/bnode_types.h"
+
+static bool has_wildcard(const node_name &pattern) {
+    for (const std::string &part : pattern.parts)
+        if (part == "*")
+            return true;
+    return false;
+}
+
+// Instances that the node belongs to, from the top, itself included when it is one.
+static std::vector<node_name> instances_of(const node_name &name) {
+    std::vector<node_name> out;
+    node_name above;
+    for (const std::string &part : name.parts) {
+        above.parts.push_back(part);
+        const schema_row *row = find_schema_row(above);
+        if (row && row->instance)
+            out.push_back(above);
+    }
+    return out;
+}
+
+void tree_refresh(node_tree *tree) {
+    tree->nodes.clear();
+    std::vector<node_name> instances;
+    for (const auto &[name, text] : tree->set) {
+        const schema_row *row = find_schema_row(name);
+        if (!row)
+            continue;
+        tree->nodes.emplace(name, node_value{row->type, text});
+        if (row->instance)
+            instances.push_back(name);
+    }
+    for (const schema_row &row : schema()) {
+        if (!row.fallback)
+            continue;
+        if (!has_wildcard(row.parts)) {
+            tree->nodes.emplace(row.parts, node_value{row.type, row.fallback});
+            continue;
+        }
+        node_name above = row.parts;
+        const std::string last = above.parts.back();
+        above.parts.pop_back();
+        for (const node_name &instance : instances)
+            if (matches(above, instance))
+                tree->nodes.emplace(instance.below(last), node_value{row.type, row.fallback});
+    }
+}
+
+// --- Checks of the whole
+
+static const std::string *text_at(const node_tree &tree, const node_name &name) {
+    const auto found = tree.nodes.find(name);
+    return found == tree.nodes.end() ? nullptr : &found->second.text;
+}
+
+static bool check_routers(const node_tree &tree, const node_name &group, std::string *out_reason) {
+    const node_name list = group.below("router");
+    node_list entries;
+    collect_nodes(tree.nodes, list, {false, false, false}, &entries);
+    std::set<std::string> seen;
+    uint32_t expected = 1;
+    for (const auto *entry : entries) {
+        const auto &[name, value] = *entry;
+        if (value.text != std::to_string(expected++)) {
+            *out_reason = list.text() + ": entries are numbered from 1 without a gap, number " +
+                          std::to_string(expected - 1) + " is missing";
+            return false;
+        }
+        const std::string *address = text_at(tree, name.below("ipaddr"));
+        if (!address) {
+            *out_reason = name.text() + ": has no ipaddr";
+            return false;
+        }
+        if (*address == "0.0.0.0" || !seen.insert(*address).second) {
+            *out_reason = name.text() + "/ipaddr: " + *address +
+                          (*address == "0.0.0.0" ? " is no router's address" : " is given twice");
+            return false;
+        }
+    }
+    return true;
+}
+
+static bool check_masks(const node_tree &tree, const node_name &group, std::string *out_reason) {
+    int bits = 0;
+    for (const char *mask : {"mask_src_ip", "mask_dst_ip", "mask_src_port", "mask_dst_port"})
+        if (const std::string *text = text_at(tree, group.below(mask)))
+            bits += std::popcount(std::stoull(*text));
+    if (bits <= 7)
+        return true;
+    *out_reason =
+        group.text() + ": the four masks have " + std::to_string(bits) + " bits set together, the most is 7";
+    return false;
+}
+
+bool tree_check(const node_tree &tree, std::string *out_reason) {
+    static const node_name groups = {{"qv", "wccpd", "wccp", "srv_grp", "config"}};
+    node_list roots;
+    collect_nodes(tree.nodes, groups, {false, false, false}, &roots);
+    for (const auto *root : roots)
+        if (!check_routers(tree, root->first, out_reason) || !check_masks(tree, root->first, out_reason))
+            return false;
+    return true;
+}
+
+void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk, node_list *out) {
+    for (auto at = nodes.lower_bound(root); at != nodes.end(); ++at) {
+        const bool self = at->first == root;
+        if (!self && !at->first.is_under(root))
+            break;
+        if (self && !walk.include_self)
+            continue;
+        if (!self && !walk.subtree && at->first.parts.size() != root.parts.size() + 1)
+            continue;
+        const auto next = std::next(at);
+        if (walk.leaves_only && next != nodes.end() && next->first.is_under(at->first))
+            continue;
+        out->push_back(&*at);
+    }
+}
+
+// --- Commits
+
+static commit_result refused(uint32_t code, const std::string &name, const std::string &reason) {
+    return {code, name + ": " + reason, {}};
+}
+
+static commit_result remove_step(node_tree *tree, const set_step &step, const node_name &name) {
+    const bool instance = find_schema_row(name)->instance;
+    bool found = tree->set.erase(name) > 0;
+    for (auto at = tree->set.lower_bound(name); at != tree->set.end() && at->first.is_under(name);) {
+        found = true;
+        at = tree->set.erase(at);
+    }
+    if (!found && instance)
+        return refused(LC_NOT_FOUND, step.name, "does not exist");
+    return {};
+}
+
+static commit_result value_step(node_tree *tree, const set_step &step, const node_name &name,
+                                const schema_row &row) {
+    const bool as_text = step.type == bn_type_str || (row.instance && step.type == bn_type_none);
+    if (step.type != row.type && !as_text)
+        return refused(LC_BAD_TYPE, step.name,
+                       std::string("is of type ") + type_name(row.type) + ", not " + type_name(step.type));
+    std::string text, reason;
+    if (!check_value(row, name, step.text, &text, &reason))
+        return refused(LC_BAD_ARGUMENT, step.name, reason);
+    for (const node_name &instance : instances_of(name)) {
+        if (tree->set.contains(instance))
+            continue;
+        if (step.kind == set_kind::modify)
+            return refused(LC_NOT_FOUND, step.name, instance.text() + " does not exist");
+        tree->set[instance] = instance.parts.back();
+    }
+    tree->set[name] = text;
+    return {};
+}
+
+std::vector<node_change> tree_difference(const node_map &before, const node_map &after) {
+    std::vector<node_change> changes;
+    auto a = before.begin();
+    auto b = after.begin();
+    while (a != before.end() || b != after.end()) {
+        const bool take_a = b == after.end() || (a != before.end() && a->first <= b->first);
+        const bool take_b = a == before.end() || (b != after.end() && b->first <= a->first);
+        if (!take_a || !take_b || a->second != b->second) {
+            node_change change;
+            change.name = take_a ? a->first : b->first;
+            if (take_a)
+                change.before = a->second;
+            if (take_b)
+                change.after = b->second;
+            changes.push_back(std::move(change));
+        }
+        if (take_a)
+            ++a;
+        if (take_b)
+            ++b;
+    }
+    return changes;
+}
+
+commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &steps, node_tree *out_next) {
+    out_next->set = tree.set;
+    out_next->revision = tree.revision + 1;
+    for (const set_step &step : steps) {
+        node_name name;
+        if (!parse_node_name(step.name, &name))
+            return refused(LC_BAD_PATH, step.name, "is no absolute node name");
+        const schema_row *row = find_schema_row(name);
+        if (!row)
+            return refused(LC_NOT_FOUND, step.name, "there is no such node in the configuration");
+        commit_result result = step.kind == set_kind::remove ? remove_step(out_next, step, name)
+                                                             : value_step(out_next, step, name, *row);
+        if (result.code != 0)
+            return result;
+    }
+    tree_refresh(out_next);
+    std::string reason;
+    if (!tree_check(*out_next, &reason))
+        return {LC_ASSERTION, reason, {}};
+    return {0, "", tree_difference(tree.nodes, out_next->nodes)};
+}

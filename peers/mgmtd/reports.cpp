@@ -1,0 +1,123 @@
+// What the daemons report: alarms that stand and roles of service groups, as nodes that anybody can read.
+//
+//   /qv/alarms/state/raised/TYPE/SOURCE          the text of the alarm; below it name, since, reporter
+//   /qv/alarms/state/role/GROUP                  the role's name; below it code, since
+//
+// TYPE is the number of the alarm, SOURCE says what it is about. A report that comes again replaces the one
+// before. Alarms are not resent by whoever raised them, so those of a session that ends are taken as
+// cleared: a daemon that is gone watches nothing. Each report is passed on to those with an interest in it.
+#include <ctime>
+
+#include "peers/mgmtd/server.h"
+#include "peers/nodes/schema.h"
+#include "runtime/ttime.h"
+
+// Of what a report says, as much is kept as a person reads; with ALARMS_MAX of them a walk still fits in one
+// message.
+static constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
+
+static const char *const ALARMS = "/qv/alarms/state/raised";
+static const char *const ROLES = "/qv/alarms/state/role";
+
+static node_name named(const char *text) {
+    node_name out;
+    (void)parse_node_name(text, &out);
+    return out;
+}
+
+static node_value time_now() {
+    owned_text text;
+    const auto now = static_cast<lt_time_sec>(time(nullptr));
+    if (lt_datetime_sec_to_str(now, 0, &text.pointer) != LC_OK || !text.pointer)
+        return {bn_type_datetime_sec, "1970/01/01 00:00:00"};
+    return {bn_type_datetime_sec, text.pointer};
+}
+
+static void remove_report(server *self, const node_name &root) {
+    self->alarm_owners.erase(root);
+    self->state.erase(root);
+    for (auto at = self->state.lower_bound(root); at != self->state.end() && at->first.is_under(root);)
+        at = self->state.erase(at);
+}
+
+static bool keep_report(server *self, uint32_t peer_id, const node_name &root) {
+    if (!self->alarm_owners.contains(root) && self->alarm_owners.size() >= ALARMS_MAX)
+        return false;
+    self->alarm_owners[root] = peer_id;
+    return true;
+}
+
+static std::string text_or(const std::vector<event_field> &fields, const char *name, const char *otherwise,
+                           size_t most = SOURCE_MAX) {
+    const std::string *text = find_field(fields, name);
+    return text && !text->empty() ? text->substr(0, most) : otherwise;
+}
+
+static node_name alarm_root(const std::vector<event_field> &fields) {
+    return named(ALARMS).below(text_or(fields, "alarm_type", "0")).below(text_or(fields, "param_3", "-"));
+}
+
+static void take_raise(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+    const node_name root = alarm_root(fields);
+    if (!keep_report(self, peer_id, root)) {
+        self->say("alarm lost, too many stand: " + root.text());
+        return;
+    }
+    const std::string comment = text_or(fields, "comment", "", TEXT_MAX);
+    self->state[root] = {bn_type_str, comment};
+    self->state[root.below("name")] = {bn_type_str, alarm_name(root.parts[root.parts.size() - 2])};
+    self->state[root.below("since")] = time_now();
+    self->state[root.below("reporter")] = {bn_type_str, self->peers[peer_id].name};
+    self->say("alarm raised: " + root.parts.back() + " " + comment);
+}
+
+static void take_clear(server *self, uint32_t, const std::vector<event_field> &fields) {
+    const node_name root = alarm_root(fields);
+    remove_report(self, root);
+    self->say("alarm cleared: " + root.parts.back() + " " + text_or(fields, "comment", "", TEXT_MAX));
+}
+
+static void take_role(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+    const node_name root = named(ROLES).below(text_or(fields, "group", "-"));
+    if (!keep_report(self, peer_id, root))
+        return;
+    const char *role = role_name(text_or(fields, "role", ""));
+    std::string code;
+    if (!canonical_text(bn_type_uint32, text_or(fields, "code", "0"), &code))
+        code = "0";
+    self->state[root] = {bn_type_str, role};
+    self->state[root.below("code")] = {bn_type_uint32, code};
+    self->state[root.below("since")] = time_now();
+    self->say("role of group " + root.parts.back() + ": " + role);
+}
+
+static const struct {
+    const char *event;
+    void (*take)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+} reports[] = {
+    {"/qv/alarms/events/raise_alarm", take_raise},
+    {"/qv/alarms/events/clear_alarm", take_clear},
+    {"/qv/state/events/role_change", take_role},
+};
+
+void server_take_event(server *self, uint32_t peer_id, const std::string &event,
+                       const std::vector<event_field> &fields) {
+    for (const auto &report : reports)
+        if (event == report.event) {
+            report.take(self, peer_id, fields);
+            server_send_event(self, event, fields);
+            return;
+        }
+    self->say("event of " + self->peers[peer_id].name + " passed over: " + event);
+}
+
+void server_forget_reports(server *self, uint32_t peer_id) {
+    std::vector<node_name> gone;
+    for (const auto &[root, owner] : self->alarm_owners)
+        if (owner == peer_id)
+            gone.push_back(root);
+    for (const node_name &root : gone) {
+        remove_report(self, root);
+        self->say("forgotten with its session: " + root.text());
+    }
+}

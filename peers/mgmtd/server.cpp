@@ -1,0 +1,355 @@
+// Sessions' messages: actions with the interests among them, changes of the configuration, events.
+//
+// Everything runs on one thread, from the loop of the transport. A message is read, acted on and answered
+// before the next one; only a query for the state of another daemon waits, as a record in `pending`, and
+// nothing waits for it. What is sent goes to the transport's queue. Queries are in queries.cpp, alarms and
+// state events in reports.cpp.
+//
+// Whoever has reached the socket is trusted: the transport lets only root and its own user in. What comes is
+// bounded by the frame that brought it all the same.
+#include "peers/mgmtd/server.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include <unistd.h>
+
+#include "mgmt/bnode_proto.h"
+
+static constexpr uint16_t SERVICE = 2;
+
+// --- Sending
+
+bool server_send_request(server *self, uint32_t peer_id, bn_request_msg *msg) {
+    const auto found = self->peers.find(peer_id);
+    if (!msg || found == self->peers.end())
+        return false;
+    msg->service_id = SERVICE;
+    if (msg->msg_id == 0)
+        msg->msg_id = found->second.next_message_id++;
+    if (msg->transaction_id == 0)
+        msg->transaction_id = msg->msg_id + 1;
+    tbuffer *frame = nullptr;
+    if (bn_request_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &frame) != LC_OK)
+        return false;
+    self->send(peer_id, msg->msg_type, frame);
+    return true;
+}
+
+bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, uint32_t transaction_id) {
+    const auto found = self->peers.find(peer_id);
+    if (!msg || found == self->peers.end())
+        return false;
+    msg->service_id = SERVICE;
+    msg->msg_id = found->second.next_message_id++;
+    msg->transaction_id = transaction_id;
+    msg->db_revision_id = self->tree.revision;
+    tbuffer *frame = nullptr;
+    if (bn_response_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &frame) != LC_OK)
+        return false;
+    self->send(peer_id, msg->msg_type, frame);
+    return true;
+}
+
+static void answer(server *self, uint32_t peer_id, const bn_request_msg *request, uint32_t code,
+                   const std::string &message) {
+    owned_response response;
+    if (bn_response_msg_create(&response.pointer, bn_request_msg_response_msg_type(request->msg_type),
+                               request->msg_id, code, message.c_str()) == LC_OK)
+        (void)server_send_response(self, peer_id, response.pointer, request->transaction_id);
+}
+
+static bool wants(const peer &who, const std::string &event) {
+    return std::any_of(who.interests.begin(), who.interests.end(),
+                       [&](const interest &wish) { return wish.event == event; });
+}
+
+void server_send_event(server *self, const std::string &event, const std::vector<event_field> &fields) {
+    std::vector<uint32_t> ids;
+    for (const auto &[id, who] : self->peers)
+        if (wants(who, event))
+            ids.push_back(id);
+    for (const uint32_t id : ids) {
+        const owned_request msg(make_event(event, fields));
+        (void)server_send_request(self, id, msg.pointer);
+    }
+}
+
+void server_process_event(server *self, const std::string &event, const std::string &process) {
+    self->say("process " + process + ": " + event);
+    server_send_event(self, event, {{"process_name", {bn_type_str, process}}});
+}
+
+// --- Actions
+
+struct action_answer {
+    uint32_t code;
+    std::string message;
+};
+
+// "match/N/pattern" in the order of N; the order doesn't matter to a match.
+static action_answer add_interest(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+    interest wish;
+    for (const event_field &field : fields) {
+        const std::string &name = field.name;
+        if (name == "event_name")
+            wish.event = field.value.text;
+        else if (name.starts_with("match/") && name.ends_with("/pattern"))
+            wish.patterns.push_back(field.value.text);
+        else
+            return {LC_BAD_ARGUMENT, "An interest has no " + name};
+    }
+    node_name event;
+    if (!parse_node_name(wish.event, &event))
+        return {LC_BAD_ARGUMENT, "An interest needs an event_name"};
+    for (const std::string &pattern : wish.patterns)
+        if (node_name parsed; !parse_node_name(pattern, &parsed))
+            return {LC_BAD_ARGUMENT, "No pattern: " + pattern};
+    peer &who = self->peers[peer_id];
+    std::erase_if(who.interests, [&](const interest &old) { return old.event == wish.event; });
+    who.interests.push_back(std::move(wish));
+    return {};
+}
+
+static action_answer remove_interest(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+    const std::string *event = find_field(fields, "event_name");
+    if (!event || std::erase_if(self->peers[peer_id].interests,
+                                [&](const interest &old) { return old.event == *event; }) == 0)
+        return {LC_NOT_FOUND, "No such interest"};
+    return {};
+}
+
+// What happened to a process, told by whoever started it.
+static action_answer report_process(server *self, uint32_t, const std::vector<event_field> &fields) {
+    static const std::map<std::string, const char *> events = {
+        {"crash", "/pm/events/failure/crash"},
+        {"unexpected_exit", "/pm/events/failure/unexpected_exit"},
+        {"terminate", "/pm/events/proc/terminate"},
+    };
+    const std::string *process = find_field(fields, "process_name");
+    const std::string *kind = find_field(fields, "event");
+    const auto found = kind ? events.find(*kind) : events.end();
+    if (!process || process->empty() || found == events.end())
+        return {LC_BAD_ARGUMENT,
+                "A report needs process_name and event: crash, unexpected_exit or terminate"};
+    server_process_event(self, found->second, *process);
+    return {};
+}
+
+static action_answer report_zone(server *self, uint32_t, const std::vector<event_field> &) {
+    self->say("time zone changed");
+    server_send_event(self, "/time/notify/zonechange", {});
+    return {};
+}
+
+static const struct {
+    const char *name;
+    action_answer (*run)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+} actions[] = {
+    {"/mgmtd/events/actions/interest/add", add_interest},
+    {"/mgmtd/events/actions/interest/remove", remove_interest},
+    {"/mgmtd/process/actions/report", report_process},
+    {"/mgmtd/time/actions/zonechange", report_zone},
+};
+
+static void take_action(server *self, uint32_t peer_id, const bn_request_msg *msg) {
+    const std::string name = msg->text ? ts_str(msg->text) : "";
+    for (const auto &action : actions)
+        if (name == action.name) {
+            const action_answer result = action.run(self, peer_id, fields_of(msg));
+            answer(self, peer_id, msg, result.code, result.message);
+            return;
+        }
+    answer(self, peer_id, msg, LC_NOT_FOUND, "No such action: " + name);
+}
+
+// --- Changes of the configuration
+
+static void tell_change(server *self, const std::vector<node_change> &changes) {
+    std::vector<std::pair<uint32_t, std::vector<const node_change *>>> told;
+    for (const auto &[id, who] : self->peers) {
+        std::vector<const node_change *> wanted;
+        for (const interest &wish : who.interests) {
+            if (wish.event != CHANGE_EVENT)
+                continue;
+            for (const node_change &change : changes)
+                if (wish.patterns.empty() ||
+                    std::any_of(wish.patterns.begin(), wish.patterns.end(), [&](const std::string &pattern) {
+                        return interest_matches(pattern, change.name);
+                    }))
+                    wanted.push_back(&change);
+        }
+        if (!wanted.empty())
+            told.emplace_back(id, std::move(wanted));
+    }
+    for (const auto &[id, wanted] : told) {
+        const owned_request msg(make_change_event(wanted));
+        (void)server_send_request(self, id, msg.pointer);
+    }
+}
+
+commit_result server_commit(server *self, const std::vector<set_step> &steps, const std::string &who) {
+    commit_result result =
+        tree_commit(&self->tree, steps, [&](const node_tree &next, commit_result *inout_result) {
+            std::string error;
+            if (self->config_file.empty() || config_save(self->config_file, next, self->comments, &error))
+                return true;
+            inout_result->code = LC_IO_ERROR;
+            inout_result->message = "The configuration could not be saved: " + error;
+            return false;
+        });
+    if (result.code != 0)
+        self->say("commit of " + who + " refused: " + result.message);
+    else
+        self->say("commit " + std::to_string(self->tree.revision) + " of " + who + ": " +
+                  std::to_string(result.changes.size()) + " nodes changed");
+    if (result.code == 0)
+        tell_change(self, result.changes);
+    return result;
+}
+
+void server_reload(server *self) {
+    node_tree next;
+    config_comments comments;
+    std::string errors;
+    // A file that is gone for a moment is no wish to have everything deleted.
+    if (access(self->config_file.c_str(), R_OK) != 0)
+        errors = self->config_file + ": " + strerror(errno) + "\n";
+    if (!errors.empty() || !config_load(self->config_file, &next, &comments, &errors)) {
+        self->say("configuration not read again:\n" + errors);
+        return;
+    }
+    const std::vector<node_change> changes = tree_difference(self->tree.nodes, next.nodes);
+    next.revision = self->tree.revision + (changes.empty() ? 0 : 1);
+    self->tree = std::move(next);
+    self->comments = std::move(comments);
+    self->say("configuration read again: " + std::to_string(changes.size()) + " nodes changed");
+    tell_change(self, changes);
+}
+
+static void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
+    std::vector<set_step> steps;
+    const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
+    for (uint32_t i = 0; i < count; i++) {
+        const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
+        if (!node || !node->binding)
+            continue;
+        const node_value value = value_of(node->binding);
+        set_step step{set_kind::modify, name_of(node->binding), value.type, value.text};
+        if (node->subop == bn_set_create)
+            step.kind = set_kind::create;
+        else if (node->subop == bn_set_delete || node->subop == bn_set_reset)
+            step.kind = set_kind::remove;
+        else if (node->subop != bn_set_modify) {
+            answer(self, peer_id, msg, LC_NOT_IMPLEMENTED,
+                   step.name + ": nodes are created, modified, reset and deleted only");
+            return;
+        }
+        steps.push_back(std::move(step));
+    }
+    const commit_result result = server_commit(self, steps, self->peers[peer_id].name);
+    answer(self, peer_id, msg, result.code, result.message);
+}
+
+// --- Sessions and their messages
+
+void server_peer_opened(server *self, uint32_t peer_id, const std::string &name) {
+    peer &who = self->peers[peer_id];
+    who.name = name;
+    who.first_seen = ++self->peers_seen;
+    self->say("session of " + name + " open");
+}
+
+static void answer_without(server *self, const pending_query &query, uint32_t code, const std::string &why) {
+    owned_response response;
+    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, query.whole ? code : 0,
+                                     query.whole ? why.c_str() : "") != LC_OK)
+        return;
+    for (const auto &[node_id, field] : query.answered) {
+        owned_binding binding(make_binding(field.name, field.value));
+        if (binding.pointer)
+            (void)bn_query_response_msg_append_binding_takeover(response.pointer, &binding.pointer, node_id);
+    }
+    (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
+}
+
+void server_peer_closed(server *self, uint32_t peer_id) {
+    const auto found = self->peers.find(peer_id);
+    if (found == self->peers.end())
+        return;
+    const std::string name = found->second.name;
+    self->say("session of " + name + " closed");
+    self->peers.erase(found);
+    std::vector<pending_query> left;
+    for (auto at = self->pending.begin(); at != self->pending.end();) {
+        const bool gone = at->second.asker == peer_id || at->second.provider == peer_id;
+        if (at->second.provider == peer_id)
+            left.push_back(at->second);
+        at = gone ? self->pending.erase(at) : std::next(at);
+    }
+    for (const pending_query &query : left)
+        answer_without(self, query, LC_IO_CLOSED, name + " ended its session before it answered");
+    server_forget_reports(self, peer_id);
+}
+
+int64_t server_tick(server *self) {
+    const int64_t now = self->now_ms();
+    int64_t next = -1;
+    std::vector<pending_query> late;
+    for (auto at = self->pending.begin(); at != self->pending.end();) {
+        if (at->second.deadline_ms <= now) {
+            late.push_back(at->second);
+            at = self->pending.erase(at);
+            continue;
+        }
+        if (next < 0 || at->second.deadline_ms < next)
+            next = at->second.deadline_ms;
+        ++at;
+    }
+    for (const pending_query &query : late) {
+        const auto provider = self->peers.find(query.provider);
+        const std::string name = provider == self->peers.end() ? "the daemon" : provider->second.name;
+        self->say("query: no answer from " + name);
+        answer_without(self, query, LC_IO_TIMED_OUT, name + " did not answer in time");
+    }
+    return next;
+}
+
+static bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
+    owned_request msg;
+    if (bn_request_msg_deserialize(frame, BN_FRAME_HEADER_BYTES, &msg.pointer) != LC_OK ||
+        msg.pointer->msg_type != mtype)
+        return false;
+    switch (mtype) {
+    case bn_msg_query_request:
+        server_answer_query(self, peer_id, msg.pointer);
+        return true;
+    case bn_msg_set_request:
+        take_set(self, peer_id, msg.pointer);
+        return true;
+    case bn_msg_action_request:
+        take_action(self, peer_id, msg.pointer);
+        return true;
+    case bn_msg_event:
+        server_take_event(self, peer_id, msg.pointer->text ? ts_str(msg.pointer->text) : "",
+                          fields_of(msg.pointer));
+        answer(self, peer_id, msg.pointer, 0, "");
+        return true;
+    default:
+        return false;
+    }
+}
+
+bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
+    if (!self->peers.contains(peer_id) || mtype < bn_msg_query_request || mtype > bn_msg_event_ack)
+        return false;
+    if (mtype % 2 == 1)
+        return take_request(self, peer_id, mtype, frame);
+    owned_response msg;
+    if (bn_response_msg_deserialize(frame, BN_FRAME_HEADER_BYTES, &msg.pointer) != LC_OK)
+        return false;
+    if (mtype == bn_msg_query_response)
+        server_take_monitor_answer(self, peer_id, msg.pointer);
+    return true;
+}

@@ -1,0 +1,77 @@
+// What mgmtd does with the messages of its sessions, apart from sockets, processes and the clock.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "peers/mgmtd/config_file.h"
+#include "peers/mgmtd/messages.h"
+#include "peers/mgmtd/node_tree.h"
+
+constexpr int64_t MONITOR_TIMEOUT_MS = 5000;
+constexpr size_t ALARMS_MAX = 4096; // that are kept
+
+struct interest {
+    std::string event;
+    std::vector<std::string> patterns; // of changed nodes; none means all
+};
+struct peer {
+    std::string name; // "wccpd-123"
+    std::vector<interest> interests;
+    uint32_t next_message_id = 1;
+    uint64_t first_seen = 0;
+};
+
+// A query that waits for the daemon whose nodes it asks for.
+struct pending_query {
+    uint32_t asker, provider;
+    uint32_t asker_message_id, asker_transaction_id;
+    int64_t deadline_ms;
+    bool whole; // every node of it went to the provider, so that no answer is a failure
+    std::vector<std::pair<uint32_t, event_field>> answered; // node id and binding, answered here
+    std::map<uint32_t, uint32_t> node_ids;                  // of the forwarded query to the asker's
+};
+
+struct server {
+    // The frame has 32 bytes of room for its header; it is the callee's.
+    std::function<void(uint32_t peer_id, uint16_t mtype, tbuffer *frame)> send;
+    std::function<int64_t()> now_ms; // monotonic
+    std::function<void(const std::string &line)> say;
+    std::string config_file; // "" keeps the configuration in memory only
+
+    node_tree tree;
+    config_comments comments;
+    node_map state; // nodes that mgmtd itself reports
+    std::map<uint32_t, peer> peers;
+    std::map<uint32_t, pending_query> pending;  // by the message id of the forwarded query
+    std::map<node_name, uint32_t> alarm_owners; // root nodes of what a session reported
+    uint32_t next_query_id = 0x40000000;        // apart from the ids of other messages
+    uint64_t peers_seen = 0;
+};
+
+void server_peer_opened(server *self, uint32_t peer_id, const std::string &name);
+void server_peer_closed(server *self, uint32_t peer_id);
+// A frame of protocol 2, whole. False: it could not be read, and the session ends.
+bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame);
+// Answers the queries whose time is over. Gives the time of the next one, or -1.
+int64_t server_tick(server *self);
+
+void server_send_event(server *self, const std::string &event, const std::vector<event_field> &fields);
+// "/pm/events/..." to whoever asked for it.
+void server_process_event(server *self, const std::string &event, const std::string &process);
+commit_result server_commit(server *self, const std::vector<set_step> &steps, const std::string &who);
+
+// The configuration file is read again and what differs is told as one commit; a bad file changes nothing.
+void server_reload(server *self);
+
+// The parts of it, for each other.
+bool server_send_request(server *self, uint32_t peer_id, bn_request_msg *msg);
+bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, uint32_t transaction_id);
+void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg);
+void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg);
+void server_take_event(server *self, uint32_t peer_id, const std::string &event,
+                       const std::vector<event_field> &fields);
+void server_forget_reports(server *self, uint32_t peer_id);

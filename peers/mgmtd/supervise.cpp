@@ -1,0 +1,123 @@
+// Supervision.
+//
+// A child that ends is reported first and started again later: the daemon that hears of the end of tunneld
+// exits by itself, and is started again like any other. The delay doubles from one second to thirty with
+// each end and falls back after a run that lasted. Children get default signal handling, an empty signal
+// mask and SIGTERM should mgmtd die before them, so that its next start finds the field clear.
+#include "peers/mgmtd/supervise.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+
+#include <sys/prctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "runtime/common.h"
+
+int64_t next_delay(int64_t before_ms, int64_t ran_ms) {
+    if (before_ms == 0 || ran_ms >= SETTLED_MS)
+        return RESTART_DELAY_FIRST_MS;
+    return std::min(before_ms * 2, RESTART_DELAY_MAX_MS);
+}
+
+const char *end_event(int wait_status, bool ending) {
+    if (ending || (WIFSIGNALED(wait_status) && WTERMSIG(wait_status) == SIGTERM))
+        return "/pm/events/proc/terminate";
+    return WIFSIGNALED(wait_status) ? "/pm/events/failure/crash" : "/pm/events/failure/unexpected_exit";
+}
+
+static std::string end_text(int wait_status) {
+    return WIFSIGNALED(wait_status) ? std::string("ended by ") + lc_signal_num_to_name(WTERMSIG(wait_status))
+                                    : "exited with " + std::to_string(WEXITSTATUS(wait_status));
+}
+
+[[noreturn]] static void become(const std::vector<std::string> &command, pid_t parent) {
+    prctl(PR_SET_PDEATHSIG, SIGTERM);
+    if (getppid() != parent)
+        _exit(127);
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
+    signal(SIGPIPE, SIG_DFL);
+    std::vector<char *> arguments;
+    arguments.reserve(command.size() + 1);
+    for (const std::string &word : command)
+        arguments.push_back(const_cast<char *>(word.c_str()));
+    arguments.push_back(nullptr);
+    execvp(arguments[0], arguments.data());
+    dprintf(STDERR_FILENO, "%s: %s\n", arguments[0], strerror(errno));
+    _exit(127);
+}
+
+static void start(supervisor *self, child *process) {
+    const pid_t parent = getpid();
+    const pid_t pid = fork();
+    if (pid == 0)
+        become(process->command, parent);
+    process->started_ms = self->now_ms();
+    if (pid < 0) {
+        process->delay_ms = next_delay(process->delay_ms, 0);
+        process->start_at_ms = process->started_ms + process->delay_ms;
+        self->say("process " + process->name + ": fork: " + strerror(errno));
+        return;
+    }
+    process->pid = pid;
+    process->kill_at_ms = -1;
+    self->say("process " + process->name + ": started, pid " + std::to_string(pid));
+}
+
+void supervisor_reap(supervisor *self) {
+    for (child &process : self->children) {
+        int status = 0;
+        if (process.pid == 0 || waitpid(process.pid, &status, WNOHANG) != process.pid)
+            continue;
+        const int64_t now = self->now_ms();
+        process.pid = 0;
+        process.delay_ms = next_delay(process.delay_ms, now - process.started_ms);
+        process.start_at_ms = now + process.delay_ms;
+        self->say(
+            "process " + process.name + ": " + end_text(status) +
+            (self->ending ? "" : ", starts again in " + std::to_string(process.delay_ms / 1000) + " s"));
+        self->tell(end_event(status, self->ending), process.name);
+    }
+}
+
+static int64_t end_last(supervisor *self, int64_t now) {
+    for (auto process = self->children.rbegin(); process != self->children.rend(); ++process) {
+        if (process->pid == 0)
+            continue;
+        if (process->kill_at_ms < 0) {
+            kill(process->pid, SIGTERM);
+            process->kill_at_ms = now + END_PATIENCE_MS;
+        } else if (now >= process->kill_at_ms) {
+            self->say("process " + process->name + ": does not end, killed");
+            kill(process->pid, SIGKILL);
+            process->kill_at_ms = now + END_PATIENCE_MS;
+        }
+        return process->kill_at_ms;
+    }
+    return -1;
+}
+
+int64_t supervisor_tick(supervisor *self) {
+    const int64_t now = self->now_ms();
+    if (self->ending)
+        return end_last(self, now);
+    int64_t next = -1;
+    for (child &process : self->children) {
+        if (process.pid == 0 && process.start_at_ms <= now)
+            start(self, &process);
+        if (process.pid == 0 && (next < 0 || process.start_at_ms < next))
+            next = process.start_at_ms;
+    }
+    return next;
+}
+
+bool supervisor_is_done(const supervisor &self) {
+    return std::all_of(self.children.begin(), self.children.end(),
+                       [](const child &process) { return process.pid == 0; });
+}

@@ -1,0 +1,343 @@
+// The rows of the schema and the checks that they ask for.
+//
+// Conversion is that of the bindings, so that what is accepted here arrives as it is; on top of it a row has
+// a range, a length, words or a check of its own. Numbers may be written in hexadecimal, as masks are thought
+// of, and are kept in decimal.
+//
+// Defaults are given so that a group of which only the interface and the routers are said takes part. A text
+// that may be empty has the empty text as default, because a node that is deleted and has no default takes
+// its whole group out of the daemon.
+#include "peers/nodes/schema.h"
+
+#include <algorithm>
+#include <cstring>
+
+#include "mgmt/bnode.h"
+#include "mgmt/owners.h"
+#include "peers/nodes/binding_text.h"
+#include "runtime/logging.h"
+
+static const char *check_level(const std::string &text) {
+    int32_t level = 0;
+    for (const lc_enum_entry *entry = lc_log_level_table; entry->name; entry++)
+        if (text == entry->name)
+            level = 1;
+    return level || text.empty() ? nullptr : "is no log level (emerg to debug)";
+}
+
+static const char *check_facility(const std::string &text) {
+    for (const lc_enum_entry *entry = lc_log_facility_table; entry->name; entry++)
+        if (text == std::to_string(entry->value))
+            return nullptr;
+    return "is no log facility (a multiple of 8 up to 184)";
+}
+
+static const char *check_protocol(const std::string &text) {
+    const bool digits = !text.empty() && text.find_first_not_of("0123456789") == std::string::npos;
+    if (digits && (text.size() > 3 || text == "0" || std::stoi(text) < 1 || std::stoi(text) > 255))
+        return "is not between 1 and 255";
+    if (text == "ip")
+        return "is no protocol of its own; name one that is carried in it";
+    if (text.find_first_not_of("abcdefghijklmnopqrstuvwxyz0123456789-+") != std::string::npos)
+        return "is no protocol name";
+    return nullptr;
+}
+
+static const char *check_interface(const std::string &text) {
+    return text.find_first_of("/ \t:") == std::string::npos ? nullptr : "is no interface name";
+}
+
+#define GROUP "/qv/wccpd/wccp/srv_grp/config/*"
+#define POLICY "/qv/wccpd/wccp/policy_grp/config/*"
+#define MESSAGES "/logging/syslog/action/file/*/facility"
+#define MAIN_MESSAGES "/logging/syslog/action/file/\\/var\\/log\\/messages/facility"
+
+static const std::vector<schema_row> rows = [] {
+    constexpr int64_t NUMBER_MAX = 0xffffffff;
+    std::vector<schema_row> made = {
+        {"/qv/tunneld/system/config/mode",
+         bn_type_str,
+         "router",
+         1,
+         15,
+         "router|server|bridge",
+         nullptr,
+         false,
+         {}},
+        {"/qv/tunneld/system/config/bonding", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {"/qv/tunneld/system/config/10g", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {"/qv/wccpd/system/config/mcast_ttl", bn_type_uint32, "1", 1, 255, nullptr, nullptr, false, {}},
+
+        {POLICY, bn_type_uint16, nullptr, 1, 65535, nullptr, nullptr, true, {}},
+        {POLICY "/name", bn_type_str, "", 0, 63, nullptr, nullptr, false, {}},
+
+        {GROUP, bn_type_uint8, nullptr, 0, 255, nullptr, nullptr, true, {}},
+        {GROUP "/admin", bn_type_str, "up", 1, 15, "up|down", nullptr, false, {}},
+        {GROUP "/interface", bn_type_str, nullptr, 1, 15, nullptr, check_interface, false, {}},
+        {GROUP "/router/*", bn_type_uint8, nullptr, 1, 32, nullptr, nullptr, true, {}},
+        {GROUP "/router/*/ipaddr", bn_type_ipv4addr, nullptr, 0, 0, nullptr, nullptr, false, {}},
+        {GROUP "/priority", bn_type_uint32, "200", 0, 255, nullptr, nullptr, false, {}},
+        {GROUP "/protocol", bn_type_str, "tcp", 1, 31, nullptr, check_protocol, false, {}},
+        {GROUP "/password", bn_type_str, "", 0, 8, nullptr, nullptr, false, {}},
+        {GROUP "/encap", bn_type_str, "either", 1, 15, "gre|l2|either", nullptr, false, {}},
+        {GROUP "/weight", bn_type_uint32, "100", 0, 65535, nullptr, nullptr, false, {}},
+        {GROUP "/policy_grp", bn_type_uint32, nullptr, 1, 65535, nullptr, nullptr, false, {}},
+        {GROUP "/force_l2_return", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {GROUP "/assign_method", bn_type_str, "either", 1, 15, "hash|mask|either", nullptr, false, {}},
+        {GROUP "/assign_detail", bn_type_str, nullptr, 0, 255, nullptr, nullptr, false, {}},
+        {GROUP "/hash_src_ip", bn_type_bool, "true", 0, 0, nullptr, nullptr, false, {}},
+        {GROUP "/hash_dst_ip", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {GROUP "/hash_src_port", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {GROUP "/hash_dst_port", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {GROUP "/mask_src_ip", bn_type_uint32, "0", 0, NUMBER_MAX, nullptr, nullptr, false, {}},
+        {GROUP "/mask_dst_ip", bn_type_uint32, "3840", 0, NUMBER_MAX, nullptr, nullptr, false, {}},
+        {GROUP "/mask_src_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr, false, {}},
+        {GROUP "/mask_dst_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr, false, {}},
+        {GROUP "/compatibility", bn_type_str, "ios", 1, 15, "ios|nexus", nullptr, false, {}},
+
+        {"/logging/syslog/facility/system",
+         bn_type_uint32,
+         nullptr,
+         0,
+         184,
+         nullptr,
+         check_facility,
+         false,
+         {}},
+        {"/logging/syslog/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level, false, {}},
+        {MESSAGES "/all/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level, false, {}},
+        {MAIN_MESSAGES "/override/enable", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {MESSAGES "/override/enable", bn_type_bool, nullptr, 0, 0, nullptr, nullptr, false, {}},
+        {MESSAGES "/single/*/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level, false, {}},
+    };
+    for (schema_row &row : made)
+        (void)parse_node_name(row.pattern, &row.parts);
+    return made;
+}();
+
+const std::vector<schema_row> &schema() {
+    return rows;
+}
+
+#define STATE "/qv/wccpd/wccp/srv_grp/state"
+const std::vector<const char *> &wccpd_state_nodes() {
+    static const std::vector<const char *> nodes = {
+        "/qv/wccpd/system/state/proto_ver",
+        "/qv/wccpd/system/state/version",
+        "/qv/wccpd/system/state/is_alive",
+        "/qv/wccpd/system/state/debug_global",
+        "/qv/wccpd/system/state/debug_all",
+        STATE "/*",
+        STATE "/*/oper",
+        STATE "/*/uptime",
+        STATE "/*/app_id",
+        STATE "/*/num_routers",
+        STATE "/*/num_appliances",
+        STATE "/*/debug",
+        STATE "/*/assignment",
+        STATE "/*/router/*",
+        STATE "/*/router/*/state",
+        STATE "/*/router/*/fwd_method",
+        STATE "/*/router/*/ret_method",
+        STATE "/*/router/*/assign_method",
+        STATE "/*/router/*/id",
+        STATE "/*/router/*/ipaddr",
+        STATE "/*/router/*/conn_time",
+        STATE "/*/router/*/appliance/*",
+        STATE "/*/router/*/appliance/*/load_dist",
+        // Appliances are asked for by number; as a node of its own the number keeps a walk out of it.
+        STATE "/*/appliance/*",
+        STATE "/*/appliance/*/ipaddr",
+        STATE "/*/appliance/*/weight",
+    };
+    return nodes;
+}
+
+// --- Names
+
+static bool is_number(const std::string &part) {
+    return !part.empty() && part.size() <= 18 && part[0] >= '0' && part[0] <= '9' &&
+           part.find_first_not_of("0123456789") == std::string::npos;
+}
+
+static std::strong_ordering compare_parts(const std::string &a, const std::string &b) {
+    if (a == b)
+        return std::strong_ordering::equal;
+    if (is_number(a) != is_number(b))
+        return is_number(b) <=> is_number(a);
+    if (is_number(a))
+        if (const auto by_value = std::stoull(a) <=> std::stoull(b); by_value != 0)
+            return by_value;
+    return a.compare(b) <=> 0;
+}
+
+std::strong_ordering operator<=>(const node_name &a, const node_name &b) {
+    const size_t common = std::min(a.parts.size(), b.parts.size());
+    for (size_t i = 0; i < common; i++)
+        if (const auto order = compare_parts(a.parts[i], b.parts[i]); order != 0)
+            return order;
+    return a.parts.size() <=> b.parts.size();
+}
+
+std::string node_name::text() const {
+    std::string out;
+    for (const std::string &part : parts) {
+        out += '/';
+        for (size_t i = 0; i < part.size(); i++) {
+            const bool before_special = i + 1 < part.size() && (part[i + 1] == '/' || part[i + 1] == '\\');
+            if (part[i] == '/' || (part[i] == '\\' && before_special))
+                out += '\\';
+            out += part[i];
+        }
+    }
+    return out;
+}
+
+bool node_name::is_under(const node_name &above) const {
+    return parts.size() > above.parts.size() &&
+           std::equal(above.parts.begin(), above.parts.end(), parts.begin());
+}
+
+node_name node_name::below(const std::string &part) const {
+    node_name out = *this;
+    out.parts.push_back(part);
+    return out;
+}
+
+bool parse_node_name(const std::string &text, node_name *out) {
+    owned_tstr_array split;
+    int absolute = 0;
+    out->parts.clear();
+    if (text.find('\0') != std::string::npos ||
+        bn_binding_name_to_parts(text.c_str(), &split.pointer, &absolute) != LC_OK || !absolute)
+        return false;
+    const uint32_t count = tstr_array_length_quick(split.pointer);
+    for (uint32_t i = 0; i < count; i++) {
+        const char *part = tstr_array_get_str_quick(split.pointer, i);
+        if (!part || !*part)
+            return false;
+        out->parts.emplace_back(part);
+    }
+    return count > 0;
+}
+
+bool matches(const node_name &pattern, const node_name &name) {
+    return pattern.parts.size() == name.parts.size() &&
+           std::equal(pattern.parts.begin(), pattern.parts.end(), name.parts.begin(),
+                      [](const std::string &wanted, const std::string &part) {
+                          return wanted == "*" || wanted == part;
+                      });
+}
+
+const schema_row *find_schema_row(const node_name &name) {
+    for (const schema_row &row : rows)
+        if (matches(row.parts, name))
+            return &row;
+    return nullptr;
+}
+
+// --- Values
+
+bool canonical_text(uint32_t type, const std::string &text, std::string *out_text) {
+    if (text.find('\0') != std::string::npos)
+        return false;
+    owned_attrib attrib;
+    owned_text out;
+    if (bn_attrib_new_str(&attrib.pointer, bn_attrib_value, type, 0, text.c_str()) != LC_OK ||
+        bn_attrib_get_str(attrib.pointer, nullptr, 0, nullptr, &out.pointer) != LC_OK || !out.pointer)
+        return false;
+    *out_text = out.pointer;
+    return true;
+}
+
+static std::string from_hexadecimal(uint32_t type, const std::string &text) {
+    if (!bn_type_numeric(type) || text.size() < 3 || text.size() > 18 || text[0] != '0' ||
+        (text[1] != 'x' && text[1] != 'X') ||
+        text.find_first_not_of("0123456789abcdefABCDEF", 2) != std::string::npos)
+        return text;
+    return std::to_string(std::stoull(text.substr(2), nullptr, 16));
+}
+
+static bool is_one_of(const char *words, const std::string &text) {
+    for (const char *word = words; word;) {
+        const char *end = strchr(word, '|');
+        if (text == (end ? std::string(word, end) : std::string(word)))
+            return true;
+        word = end ? end + 1 : nullptr;
+    }
+    return false;
+}
+
+static std::string range_text(const schema_row &row) {
+    return std::to_string(row.min) + " and " + std::to_string(row.max);
+}
+
+static bool check_instance(const schema_row &row, const std::string &part, std::string *out_reason) {
+    if (is_number(part) && std::to_string(std::stoll(part)) == part && std::stoll(part) >= row.min &&
+        std::stoll(part) <= row.max)
+        return true;
+    *out_reason = "\"" + part + "\" is no number between " + range_text(row);
+    return false;
+}
+
+bool check_value(const schema_row &row, const node_name &name, const std::string &text, std::string *out_text,
+                 std::string *out_reason) {
+    // The numbers of all instances on the way down, for a child may be named before them.
+    for (const schema_row &above : rows) {
+        const size_t depth = above.parts.parts.size();
+        if (!above.instance || depth > name.parts.size())
+            continue;
+        const node_name root = {{name.parts.begin(), name.parts.begin() + static_cast<ptrdiff_t>(depth)}};
+        if (matches(above.parts, root) && !check_instance(above, root.parts.back(), out_reason))
+            return false;
+    }
+    if (row.instance) {
+        *out_text = name.parts.back();
+        if (text.empty() || text == *out_text)
+            return true;
+        *out_reason = "the value of this node is its own number";
+        return false;
+    }
+    const bool secret = name.parts.back() == "password";
+    const std::string shown = secret ? "the password" : "\"" + text + "\"";
+    if (!canonical_text(row.type, from_hexadecimal(row.type, text), out_text)) {
+        *out_reason = shown + " is no " + type_name(row.type);
+        return false;
+    }
+    if (bn_type_string(row.type)) {
+        const auto length = static_cast<int64_t>(text.size());
+        const bool printable = std::all_of(text.begin(), text.end(),
+                                           [](char c) { return static_cast<unsigned char>(c) >= 0x20; });
+        if (row.words && !is_one_of(row.words, text))
+            *out_reason = shown + " is none of " + row.words;
+        else if (!printable)
+            *out_reason = shown + " has control characters";
+        else if (length < row.min)
+            *out_reason = "the text may not be empty";
+        else if (length > row.max)
+            *out_reason = shown + " is longer than " + std::to_string(row.max) + " characters";
+        else
+            out_reason->clear();
+        if (!out_reason->empty())
+            return false;
+    } else if (bn_type_numeric(row.type) &&
+               (std::stoll(*out_text) < row.min || std::stoll(*out_text) > row.max)) {
+        *out_reason = shown + " is not between " + range_text(row);
+        return false;
+    }
+    if (const char *reason = row.check ? row.check(*out_text) : nullptr) {
+        *out_reason = shown + " " + reason;
+        return false;
+    }
+    return true;
+}
+
+// --- Reports
+
+const char *alarm_name(const std::string &type) {
+    return type == "196638" ? "adjacency" : type == "196639" ? "assignment" : "unknown";
+}
+
+const char *role_name(const std::string &role) {
+    return role == "0" ? "ACTIVE" : role == "1" ? "BACKUP" : "UNKNOWN";
+}
