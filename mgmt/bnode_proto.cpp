@@ -1,5 +1,5 @@
 // Messages in memory: requests and responses are made, filled, read and freed here; nothing of them is kept
-// anywhere. The bytes stand in bnode_wire.cpp, the way over a session in bnode_session.cpp.
+// anywhere. The bytes stand in bnode_wire.cpp, the way over a session in bnode_proto_session.cpp.
 #include "mgmt/bnode_proto.h"
 
 #include <cstdlib>

@@ -5,7 +5,7 @@
 #include <cstdarg>
 #include <cstdlib>
 
-#include "mgmt/log_levels.h"
+#include "mgmt/log_sync.h"
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
 

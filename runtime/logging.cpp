@@ -13,7 +13,7 @@
 //
 // The caller's format is pasted behind the line's own head and used once: the head holds no "%". A format
 // that had to be cut is cut ahead of a conversion that it would end in.
-#include "runtime/log_state.h"
+#include "runtime/logging_levels.h"
 
 #include <pthread.h>
 

@@ -12,7 +12,7 @@
 #include <sys/stat.h>
 #include <syslog.h>
 
-#include "runtime/log_state.h"
+#include "runtime/logging_levels.h"
 #include "tests/support/log_daemon.h"
 
 static constexpr const char *LINK = "/var/opt/rvl/output/sysloglevel";

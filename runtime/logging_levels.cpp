@@ -7,7 +7,7 @@
 //
 // These operations run on the main thread, any of the others may be logging: the record is changed under its
 // lock, and what can log is done before the lock is taken.
-#include "runtime/log_state.h"
+#include "runtime/logging_levels.h"
 
 #include <cerrno>
 #include <cstdio>

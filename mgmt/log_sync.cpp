@@ -1,5 +1,5 @@
 // Log levels and the time zone, as the management tree has them. What is not there leaves a level as it is.
-#include "mgmt/log_levels.h"
+#include "mgmt/log_sync.h"
 
 #include <cstdio>
 #include <cstring>
