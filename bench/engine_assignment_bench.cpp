@@ -12,6 +12,7 @@
 #include <benchmark/benchmark.h>
 
 #include "engine/wccp_assignment.h"
+#include "engine/wccp_mgr.h"
 #include "engine/wccp_router_utils.h"
 #include "engine/wccp_view_utils.h"
 #include "engine/wccp_wire.h"

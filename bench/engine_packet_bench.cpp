@@ -10,6 +10,7 @@
 #include <cstring>
 #include <memory>
 
+#include "engine/wccp_mgr.h"
 #include "engine/wccp_pkt_load.h"
 #include "engine/wccp_pkt_mgr.h"
 #include "runtime/md5.h"

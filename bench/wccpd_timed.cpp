@@ -12,7 +12,7 @@
 #include <pthread.h>
 
 #include "daemon/wccpd_main.h"
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "runtime/guards.h"
 
 namespace {

@@ -1,7 +1,7 @@
 // The configuration tree: read once at start, then followed change by change. Main thread only.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "mgmt/bnode.h"
 #include "runtime/common.h"
 

@@ -14,7 +14,7 @@
 #include "daemon/wccpd_monitor.h"
 #include "engine/wccp_host.h"
 #include "mgmt/client_session.h"
-#include "mgmt/log_levels.h"
+#include "mgmt/log_sync.h"
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
 

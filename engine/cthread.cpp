@@ -23,9 +23,9 @@
 
 #include <cstdlib>
 
-#include "engine/wccp_mgr.h"
 #include "runtime/common.h"
 #include "runtime/guards.h"
+#include "runtime/list.h"
 #include "runtime/logging.h"
 
 static constexpr uint32_t CPU_LIMIT = 128;

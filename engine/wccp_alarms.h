@@ -1,7 +1,7 @@
 // Alarms of a service group, and the client session on which alarms and state events go.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "runtime/common.h"
 
 struct gcl_session;

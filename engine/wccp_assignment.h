@@ -2,7 +2,7 @@
 // takes a group; the three computations work on their arguments alone.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 
 void wccp_designated_appliance_assignment_start(wccp_service_group *group);
 void wccp_designated_appliance_assignment_add(wccp_service_group *group,

@@ -32,6 +32,7 @@
 #include "engine/wccp_utils.h"
 #include "engine/wccp_wire.h"
 #include "engine/wccpd_common.h"
+#include "runtime/list.h"
 #include "runtime/logging.h"
 
 static constexpr uint32_t HERE_I_AM_SECONDS = 10;

@@ -3,7 +3,7 @@
 // buffers are shared.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "runtime/csys.h"
 
 // One piece in the making.

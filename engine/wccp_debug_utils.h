@@ -3,7 +3,7 @@
 // or there is no such group.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "runtime/csys.h"
 
 constexpr uint32_t WCCP_DUMP_GLOBAL_BYTES = 1024;

@@ -1,7 +1,7 @@
 // The interface table, and the reactions to the kernel's link and address notifications.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "platform/qvcommon.h"
 
 int wccp_init_link_mgr();

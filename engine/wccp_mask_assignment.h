@@ -1,6 +1,6 @@
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 
 // The values that the group's mask spans, and their owners from bucket_ipa. Lock held.
 void wccp_mask_assignment_calculate_value_table(wccp_service_group *group);

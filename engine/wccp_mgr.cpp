@@ -26,7 +26,6 @@
 #include <time.h>
 
 #include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <new>
 #include <type_traits>
@@ -90,10 +89,6 @@ int wccp_exit_mgr() {
     wccp_deinit_link_mgr();
     wccp_del_all_tunnels();
     return 0;
-}
-
-wccp_service_group *wccp_find_group(int id) {
-    return wccp_g.groups[id & 0xff];
 }
 
 int wccp_config_mcast(wccp_interface *interface) {
@@ -168,39 +163,4 @@ void *wccp_timer_thread_fn(void *) {
         }
         wccp_tick();
     }
-}
-
-static void *counted_calloc(const char *function, uint32_t count, uint32_t size) {
-    void *memory = calloc(count, size);
-    if (memory) {
-        wccp_g.stat_allocs.fetch_add(1, std::memory_order_relaxed);
-        return memory;
-    }
-    wccp_g.stat_alloc_fails.fetch_add(1, std::memory_order_relaxed);
-    QV_LOG(LC_LOG_ERR, "WCCP %s: memory allocation failed. size: %d bytes", function,
-           static_cast<int>(count * size));
-    return nullptr;
-}
-
-void *wccp_calloc(uint32_t count, uint32_t size) {
-    return counted_calloc("wccp_calloc", count, size);
-}
-
-void *wccp_malloc(uint32_t size) {
-    return counted_calloc("wccp_malloc", 1, size);
-}
-
-void wccp_free(void *memory) {
-    if (!memory)
-        return;
-    wccp_g.stat_frees.fetch_add(1, std::memory_order_relaxed);
-    free(memory);
-}
-
-void wccp_seconds_to_str(uint32_t seconds, char *buffer, uint32_t length) {
-    length &= 0xff;
-    if (!buffer || length < 32)
-        return;
-    snprintf(buffer, length, "%u:%u:%u:%u", seconds / 86400, seconds / 3600 % 24, seconds / 60 % 60,
-             seconds % 60);
 }

@@ -45,6 +45,7 @@
 #include <cstring>
 
 #include "engine/cthread.h"
+#include "engine/wccp_mgr.h"
 #include "engine/wccp_utils.h"
 #include "platform/qvcommon.h"
 #include "runtime/guards.h"

@@ -1,7 +1,7 @@
 // Sockets and packet I/O of an interface: UDP port 2048, one unicast and one multicast socket.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 
 constexpr uint16_t WCCP_PORT = 2048;
 

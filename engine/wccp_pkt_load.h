@@ -2,7 +2,7 @@
 // moves on; 1 leaves the packet as it was. The buffer is all zero before the first load. Lock held.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 
 int wccp_pkt_load_msg_header(wccp_pkt *pkt, uint32_t type);
 int wccp_pkt_load_security_info_component(wccp_service_group *group, wccp_pkt *pkt, uint8_t **out_digest);

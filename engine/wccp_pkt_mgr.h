@@ -1,7 +1,7 @@
 // The message loop in both directions. Lock held throughout.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "engine/wccp_wire.h"
 
 int wccp_process_received_packet(wccp_pkt *pkt); // 0 handled or dropped, 1 refused

@@ -2,7 +2,7 @@
 // nothing in a group but rx_unknown_capabilities. What a result points to is valid until the next receive.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "engine/wccp_wire.h"
 
 struct wccp_rtr_view_info {

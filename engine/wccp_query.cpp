@@ -2,7 +2,7 @@
 // into the caller's record and lets go; nothing that it gives out points into the engine. What is not there
 // leaves the record as the caller made it.
 
-#include "engine/wccp_config.h"
+#include "engine/wccp_query.h"
 
 #include "engine/wccp_utils.h"
 #include "runtime/common.h"

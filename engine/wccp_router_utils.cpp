@@ -24,6 +24,7 @@
 #include "engine/wccp_view_utils.h"
 #include "engine/wccp_wire.h"
 #include "runtime/guards.h"
+#include "runtime/list.h"
 
 static constexpr uint32_t SILENCE_LIMIT = 40; // seconds without an I-See-You
 static constexpr uint8_t REPLY_TRANSMISSIONS = 3;

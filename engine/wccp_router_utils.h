@@ -1,8 +1,8 @@
 // Sending routers: the capability decision, their records, inactivity, Removal Queries. Lock held throughout.
 #pragma once
 
-#include "engine/wccp_mgr.h"
 #include "engine/wccp_pkt_unload.h"
+#include "engine/wccp_records.h"
 
 wccp_sending_router *wccp_find_sending_router(wccp_service_group *group, be32 router_id);
 int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,

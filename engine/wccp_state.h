@@ -1,7 +1,7 @@
 // The heartbeat of a group: timers, election, and the three-valued state. Lock held throughout.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 
 enum : int { WCCP_ASSIGN_AFTER_ELECTION = 1, WCCP_ASSIGN_AFTER_WEIGHT_CHANGE = 2 };
 

@@ -22,6 +22,7 @@
 #include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"
 #include "runtime/guards.h"
+#include "runtime/list.h"
 #include "runtime/logging.h"
 
 static pthread_mutex_t tunnel_mutex = PTHREAD_MUTEX_INITIALIZER;

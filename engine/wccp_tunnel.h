@@ -2,7 +2,7 @@
 // Takes its own mutex, behind the engine lock.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 
 struct wccp_tunnel {
     wccp_tunnel *next, **prev_link;

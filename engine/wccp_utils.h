@@ -2,9 +2,20 @@
 // codes.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "platform/qvcommon.h"
 #include "runtime/logging.h"
+
+// The group with this id, or null. Lock held; only the low 8 bits count.
+wccp_service_group *wccp_find_group(int id);
+
+// Zeroed memory, or null with an error line; counted in wccp_g. For free() use wccp_free, which takes null.
+void *wccp_calloc(uint32_t count, uint32_t size);
+void *wccp_malloc(uint32_t size);
+void wccp_free(void *memory);
+
+// Writes "days:hours:minutes:seconds" into `buffer`; nothing when `length` is below 32 bytes.
+void wccp_seconds_to_str(uint32_t seconds, char *buffer, uint32_t length);
 
 // Dotted text of an address, by value: addr_text(ipa).s in the arguments of a log line.
 struct wccp_addr_text {

@@ -29,6 +29,7 @@
 #include "engine/wccp_state.h"
 #include "engine/wccp_utils.h"
 #include "engine/wccp_wire.h"
+#include "runtime/list.h"
 
 static constexpr uint32_t MARK = 1;
 static constexpr uint16_t HASH_BUCKETS = WCCP_MAX_BUCKETS;
@@ -54,7 +55,7 @@ int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_app
         list_push_head(&group->appliance_view, entry);
         return 0;
     }
-    list_insert_behind(head, entry);
+    list_insert_after(head, entry);
     if (entry->weight == head->weight && entry->ipa == head->ipa) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding appliance sorted failed. appliance %s", group->id,
                addr_text(entry->ipa).s);

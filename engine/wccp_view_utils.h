@@ -2,7 +2,7 @@
 // Lock held throughout.
 #pragma once
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 
 // What one router assigns to this appliance.
 struct wccp_assign_summary {

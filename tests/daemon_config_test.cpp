@@ -1,6 +1,7 @@
 // The configuration applied to an engine that stands still: what a group is made of, what each change does,
 // and what is said of values that make no sense.
 #include "daemon/wccpd_config.h"
+#include "engine/wccp_utils.h"
 
 #include <map>
 

@@ -2,6 +2,7 @@
 // end is in a namespace of its own. Whatever a test does, the tables agree with each other at its end.
 
 #include "engine/wccp_config.h"
+#include "engine/wccp_query.h"
 
 #include <gtest/gtest.h>
 
@@ -9,7 +10,9 @@
 #include <string>
 
 #include "engine/wccp_link_mgr.h"
+#include "engine/wccp_utils.h"
 #include "runtime/common.h"
+#include "runtime/list.h"
 #include "tests/support/engine_fixture.h"
 #include "tests/support/log_lines.h"
 

@@ -2,6 +2,7 @@
 // the thread contexts under it.
 
 #include "engine/wccp_mgr.h"
+#include "engine/wccp_utils.h"
 
 #include <gtest/gtest.h>
 #include <pthread.h>

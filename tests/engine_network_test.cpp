@@ -22,6 +22,7 @@
 #include "engine/wccp_config.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_link_mgr.h"
+#include "engine/wccp_mgr.h"
 #include "platform/limits.h"
 #include "runtime/common.h"
 #include "tests/support/engine_fixture.h"

@@ -20,6 +20,7 @@
 #include "engine/wccp_config.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_link_mgr.h"
+#include "engine/wccp_mgr.h"
 #include "engine/wccp_network.h"
 #include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"

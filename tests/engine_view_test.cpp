@@ -13,6 +13,7 @@
 #include "engine/wccp_state.h"
 #include "engine/wccp_utils.h"
 #include "engine/wccp_wire.h"
+#include "runtime/list.h"
 #include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 #include "tests/support/wire_bytes.h"

@@ -3,7 +3,7 @@
 #include <string>
 #include <vector>
 
-#include "mgmt/log_levels.h"
+#include "mgmt/log_sync.h"
 #include "mgmt/mdc_main.h"
 #include "runtime/logging.h"
 #include "tests/support/hand_session.h"

@@ -58,7 +58,7 @@ if [ -n "$measured" ]; then
 else
     # shellcheck disable=SC2086
     kill -STOP $mgmtd
-    for _ in $(seq 40); do
+    for _ in $(seq 100); do # about 40 on a fast machine
         flap
         grep -q 'output queue full' "$LAB/a1.log" && break
     done

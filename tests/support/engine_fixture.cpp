@@ -12,8 +12,10 @@
 #include "engine/wccp_config.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_link_mgr.h"
+#include "engine/wccp_mgr.h"
 #include "engine/wccp_network.h"
 #include "engine/wccp_tunnel.h"
+#include "engine/wccp_utils.h"
 
 #ifdef WCCP_SANITIZED
 #include <sanitizer/asan_interface.h>

@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 #include "tests/support/peer_network.h"
 
 // What wccp_is_system_in_bridge_mode answers. The host's other names are in engine/wccp_host.h.

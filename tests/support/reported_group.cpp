@@ -5,9 +5,12 @@
 #include <cstring>
 
 #include "engine/wccp_config.h"
+#include "engine/wccp_mgr.h"
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_router_utils.h"
+#include "engine/wccp_utils.h"
 #include "engine/wccp_view_utils.h"
+#include "runtime/list.h"
 
 reported_group::reported_group(bool started, uint8_t id) {
     strcpy(interface.name, "lan0");

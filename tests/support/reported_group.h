@@ -5,7 +5,7 @@
 #include <utility>
 #include <vector>
 
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_records.h"
 
 constexpr be32 host(uint32_t last_octet) { // 10.0.0.x
     return to_be32(10u << 24 | last_octet);

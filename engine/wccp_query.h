@@ -1,0 +1,65 @@
+// The engine's answers to monitoring. Each entry point takes the engine lock, copies what was asked for into
+// the caller's record and returns; nothing in a record points into the engine. Fields marked "in" are filled
+// by the caller. The result is 0, or 1 for a null record or a group that does not exist; a record whose
+// router or appliance does not exist stays as the caller made it.
+//
+// Numbers of routers and appliances are places in a list at the moment of the question, from 1.
+#pragma once
+
+#include "engine/wccp_records.h"
+
+struct wccp_grp_list {
+    uint32_t count;
+    uint8_t ids[WCCP_MAX_GROUPS];
+};
+struct wccp_grp_info {
+    be32 appliance_ipa;
+    uint32_t num_routers;
+    uint32_t num_appliances;
+    uint32_t num_view_routers;
+    uint32_t uptime; // seconds
+    char oper[128];
+};
+struct wccp_grp_router_info {
+    uint32_t router_num; // in, from 1
+    be32 router_id;
+    be32 src_ipa;
+    uint32_t conn_time; // seconds
+    char fwd[8];
+    char ret[8];
+    char assign[8];
+    char state[32];
+};
+struct wccp_grp_appliance_info {
+    uint32_t appliance_num; // in, from 1
+    be32 ipa;
+    uint32_t weight;
+};
+struct wccp_router_list {
+    uint32_t group_id; // in
+    uint32_t count;
+    uint32_t router_nums[WCCP_MAX_ROUTERS];
+};
+struct wccp_router_appliance_list {
+    uint32_t group_id;   // in
+    uint32_t router_num; // in
+    uint32_t count;
+    be32 ipa[WCCP_MAX_APPLIANCES];
+};
+struct wccp_router_appliance_info {
+    uint32_t group_id;   // in
+    uint32_t router_num; // in
+    be32 ipa;            // in
+    uint32_t load_percent;
+};
+
+int wccp_get_grp_list(wccp_grp_list *list);
+int wccp_get_grp_info(int id, wccp_grp_info *info);
+int wccp_get_grp_router_info(int id, wccp_grp_router_info *info);
+int wccp_get_grp_appliance_info(int id, wccp_grp_appliance_info *info);
+int wccp_get_router_list(wccp_router_list *list);
+int wccp_get_router_appliance_list(wccp_router_appliance_list *list);
+int wccp_get_router_appliance_info(wccp_router_appliance_info *info);
+
+// Lock held; null, with an information line, when there is no such group or router.
+wccp_sending_router *wccp_find_router_instance(int id, uint32_t router_num);

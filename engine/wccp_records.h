@@ -1,0 +1,287 @@
+// The whole memory of the engine: the one global record wccp_g, the service groups that hang from it and what
+// hangs from them. The functions that work on them are in the headers of their files.
+//
+// All of it is guarded by wccp_g.lock, the engine lock, which is not recursive: a function told "lock held"
+// never takes it again. Addresses and values straight from or to the wire are be32/be16 and compared for
+// equality only; everything else is in host order. Times are values of wccp_g.seconds, one per tick.
+//
+// Lists are intrusive: `next` is the following record, `prev_link` the pointer that points here, so that a
+// record unlinks itself without knowing the head. New records go to the head unless told otherwise.
+#pragma once
+
+#include <pthread.h>
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+
+#include "runtime/byte_order.h"
+
+constexpr uint32_t WCCP_MAX_GROUPS = 256;
+constexpr uint32_t WCCP_MAX_ROUTERS = 32;
+constexpr uint32_t WCCP_MAX_APPLIANCES = 32;
+constexpr uint32_t WCCP_MAX_BUCKETS = 256;
+constexpr uint32_t WCCP_MAX_MASK_BITS = 7;
+constexpr uint32_t WCCP_MAX_MASK_VALUES = 128;
+constexpr uint32_t WCCP_MAX_INTERFACES = 127;
+constexpr uint32_t WCCP_IF_NAME_BYTES = 16;
+constexpr uint32_t WCCP_PASSWORD_BYTES = 8;
+constexpr uint32_t WCCP_MAX_PACKET = 4096;
+constexpr uint8_t WCCP_LAST_STANDARD_ID = 50; // service ids above it are dynamic services
+
+struct cthread;
+struct wccp_service_group;
+
+enum : uint32_t { WCCP_LINK_READY = 1, WCCP_IPA_READY = 2, WCCP_ALL_READY = 3 }; // ready_flags
+enum : uint32_t { WCCP_ADMIN_UP = 1, WCCP_ADMIN_DOWN = 2 };
+enum : uint32_t { WCCP_METHOD_NONE = 0, WCCP_METHOD_GRE = 1, WCCP_METHOD_L2 = 2, WCCP_METHOD_EITHER = 3 };
+enum : uint32_t { WCCP_ASSIGN_NONE = 0, WCCP_ASSIGN_HASH = 1, WCCP_ASSIGN_MASK = 2, WCCP_ASSIGN_EITHER = 3 };
+enum : uint32_t { WCCP_COMPAT_IOS = 1, WCCP_COMPAT_NEXUS = 2 };
+enum : uint32_t { WCCP_ROLE_ACTIVE = 0, WCCP_ROLE_BACKUP = 1, WCCP_ROLE_UNKNOWN = 2 };
+enum : uint16_t { WCCP_ALARM_ADJACENCY = 1, WCCP_ALARM_ASSIGNMENT = 2 }; // raised_alarms
+enum : uint32_t {                                                        // state_flags
+    WCCP_STATE_INIT = 1,
+    WCCP_STATE_ACTIVE = 2,
+    WCCP_STATE_BACKUP = 4,
+    WCCP_STATE_MASK = 7,
+    WCCP_CAPABILITIES_SET = 8,
+    WCCP_DESG_ELECT_PENDING = 16,
+    WCCP_SHUTTING_DOWN = 32,
+};
+enum : uint32_t { // flags of a sending router
+    WCCP_RTR_ONE_WAY = 1,
+    WCCP_RTR_TWO_WAY = 2,
+    WCCP_RTR_ASSIGN_UNACKED = 4,
+    WCCP_RTR_HAS_TUNNEL = 8,
+};
+
+// A packet and its cursor. `length` is bytes loaded so far, or bytes received; `cursor` is data + offset.
+struct wccp_pkt {
+    be32 ipa; // destination (0: the group decides), or source
+    uint32_t length;
+    uint32_t offset;
+    uint8_t *cursor;
+    uint8_t data[WCCP_MAX_PACKET];
+};
+
+struct wccp_timer {
+    uint8_t active;     // 1 runs
+    uint8_t mode;       // 1 repeats, 2 runs `remaining` times
+    uint16_t remaining; // firings left in mode 2
+    uint32_t period;    // seconds
+    uint32_t countdown; // seconds to the next firing
+};
+enum : uint8_t { WCCP_TIMER_REPEATS = 1, WCCP_TIMER_COUNTS = 2 };
+
+// An interface that a group names, or the primary one. Never moves, never goes.
+struct wccp_interface {
+    char name[WCCP_IF_NAME_BYTES];
+    be32 ipa;
+    uint32_t link_up;
+    uint32_t ready_flags;
+    int32_t ucast_fd; // -1 closed; see wccp_network.cpp for the lock under which the descriptors change
+    int32_t mcast_fd;
+    uint32_t ucast_bound;
+    uint32_t mcast_bound;
+    cthread *rx_thread;
+    wccp_service_group *groups;
+    uint32_t stop_count;
+    uint32_t start_count;
+    uint32_t link_down_count;
+    uint32_t ipa_change_count;
+    int32_t device; // the kernel's index of the device that the sockets were opened on, 0 for none
+};
+
+struct wccp_dsg_appliance {
+    be32 ipa;
+    uint8_t up;
+    uint16_t weight;
+    uint16_t assigned;
+};
+
+struct wccp_mask {
+    uint32_t src_ip, dst_ip;
+    uint16_t src_port, dst_port;
+};
+struct wccp_mask_value {
+    uint32_t src_ip, dst_ip;
+    uint16_t src_port, dst_port;
+    be32 appliance_ipa;
+};
+
+struct wccp_view_appliance {
+    wccp_view_appliance *next, **prev_link;
+    be32 ipa;
+    uint16_t weight;
+    uint16_t ref_count;
+};
+struct wccp_view_router {
+    wccp_view_router *next, **prev_link;
+    be32 ipa;
+    uint16_t ref_count;
+};
+
+struct wccp_rtr_view_router {
+    be32 ipa;
+    uint32_t flags; // bit 0: mark of the view update
+};
+struct wccp_rtr_view_appliance {
+    be32 ipa;
+    uint16_t weight;
+    uint32_t flags; // bit 0: mark of the view update
+    uint16_t buckets_assigned;
+    uint16_t buckets_total;
+    uint32_t bucket_bits[8]; // hash: host-order words; mask: value i is bit i mod 8 of byte i / 8
+};
+
+struct wccp_sending_router {
+    wccp_sending_router *next, **prev_link;
+    be32 router_id;
+    be32 src_ipa;
+    be32 receive_id;
+    be32 change_number;
+    uint32_t last_icu_time;
+    uint32_t state_time;
+    uint32_t flags;
+    uint8_t cap_fwd, cap_assign, cap_ret;
+    uint32_t assign_tx_count;
+    uint32_t view_router_count;
+    uint32_t view_appliance_count;
+    wccp_rtr_view_router view_routers[WCCP_MAX_ROUTERS];
+    wccp_rtr_view_appliance view_appliances[WCCP_MAX_APPLIANCES];
+    uint32_t map_src_ip, map_dst_ip;
+    uint16_t map_src_port, map_dst_port;
+    uint16_t self_buckets;
+    uint16_t total_buckets;
+};
+
+// A Here-I-Am that waits to be sent in answer to a Removal Query.
+struct wccp_removal_reply {
+    wccp_removal_reply *next, **prev_link;
+    uint8_t tx_left;
+    wccp_pkt pkt;
+};
+
+struct wccp_service_group {
+    wccp_service_group *next, **prev_link;
+    wccp_service_group *if_next, **if_prev_link;
+    uint8_t id;
+    uint8_t if_count;
+    wccp_interface *interfaces[WCCP_MAX_INTERFACES];
+    uint8_t priority;
+    uint8_t protocol;
+    uint32_t service_flags;
+    uint32_t mask_src_ip, mask_dst_ip;
+    uint16_t mask_src_port, mask_dst_port;
+    uint32_t mask_bits;
+    uint32_t security_option; // 0 none, 1 MD5
+    char password[WCCP_PASSWORD_BYTES];
+    uint16_t weight;
+    uint32_t mcast_configured;
+    be32 mcast_ipa;
+    uint16_t ucast_router_count;
+    be32 ucast_routers[WCCP_MAX_ROUTERS];
+    uint32_t cfg_fwd_method;
+    uint32_t cfg_assign_method;
+    uint32_t admin_state;
+    uint32_t force_l2_return;
+    be32 appliance_ipa;
+    uint32_t compat_mode;
+    uint32_t fwd_method;
+    uint32_t assign_method;
+    uint32_t ret_method;
+    uint32_t change_number;
+    uint32_t state_flags;
+    uint32_t state_time;
+    uint32_t designated;
+    // The assignment block, cleared as one piece: from here ...
+    uint32_t dsg_appliance_count;
+    uint32_t dsg_active_count;
+    wccp_dsg_appliance dsg_appliances[WCCP_MAX_APPLIANCES];
+    uint32_t bucket_count;
+    be32 bucket_ipa[WCCP_MAX_BUCKETS];
+    uint8_t bucket_index[WCCP_MAX_BUCKETS];
+    uint32_t mask_value_bits;
+    wccp_mask mask_in_use;
+    uint32_t mask_bit_count;
+    wccp_mask mask_bit_array[WCCP_MAX_MASK_BITS + 1];
+    uint32_t mask_value_count;
+    wccp_mask_value mask_values[WCCP_MAX_MASK_VALUES];
+    uint32_t dsg_key_change;
+    uint8_t pending_acks; // ... to here
+    uint8_t redirecting_routers;
+    uint32_t appliance_view_count;
+    wccp_view_appliance *appliance_view;
+    uint32_t sending_router_count;
+    wccp_sending_router *sending_routers;
+    uint32_t router_view_count;
+    wccp_view_router *router_view;
+    uint32_t removal_reply_count;
+    wccp_removal_reply *removal_replies;
+    wccp_timer hia_timer;
+    wccp_timer assign_timer;
+    wccp_timer monitor_timer;
+    wccp_timer router_alarm_timer;
+    wccp_timer assign_alarm_timer;
+    wccp_pkt *tx_pkt; // owned; rebuilt for each Here-I-Am and Redirect-Assign
+    uint16_t raised_alarms;
+    uint32_t transitions;
+    uint32_t rx_icus;
+    uint32_t rx_removal_queries;
+    uint32_t tx_here_i_am;
+    uint32_t tx_redirect_assign;
+    uint32_t tx_removal_replies;
+    uint32_t tx_link_drops;
+    uint32_t routers_timed_out;
+    uint32_t alarm_router_sched;
+    uint32_t alarm_assign_sched;
+    uint32_t rx_unknown_capabilities;
+    uint32_t rx_failures;
+    uint32_t rx_icu_failures;
+    uint32_t rx_removal_failures;
+    uint32_t tx_failures;
+    uint32_t tx_build_failures;
+    uint32_t rx_auth_failures;
+    uint32_t rx_auth_mismatches;
+    uint32_t rx_service_mismatches;
+};
+
+struct wccp_global {
+    pthread_mutex_t lock;
+    uint32_t seconds;
+    uint32_t group_count;
+    wccp_service_group *groups[WCCP_MAX_GROUPS];
+    wccp_service_group *group_list;
+    uint8_t if_count;
+    wccp_interface interfaces[WCCP_MAX_INTERFACES];
+    wccp_interface *primary_if;
+    uint32_t track_primary;
+    uint8_t mcast_ttl;
+    std::atomic<uint32_t> stat_allocs; // counted from every engine thread and the management thread
+    std::atomic<uint32_t> stat_frees;
+    std::atomic<uint32_t> stat_alloc_fails;
+    uint32_t rx_failures;
+};
+extern wccp_global wccp_g;
+
+// What configuration hands to the engine. The engine copies and keeps no pointer.
+struct wccp_grp_config {
+    uint32_t config_flags;
+    uint8_t group_id;
+    uint8_t priority;
+    uint8_t protocol;
+    char password[WCCP_PASSWORD_BYTES + 1];
+    uint16_t router_count;
+    be32 routers[WCCP_MAX_ROUTERS];
+    uint16_t weight;
+    uint32_t admin;
+    uint32_t fwd_method;
+    uint32_t assign_method;
+    uint32_t hash_src_ip, hash_dst_ip, hash_src_port, hash_dst_port;
+    uint32_t mask_src_ip, mask_dst_ip;
+    uint16_t mask_src_port, mask_dst_port;
+    uint32_t force_l2_return;
+    uint8_t interface_set;
+    char interface[WCCP_IF_NAME_BYTES];
+    uint32_t compatibility;
+};
