@@ -29,19 +29,13 @@
 #include "mgmt/bnode.h"
 #include "mgmt/log_sync.h"
 #include "mgmt/mdc_main.h"
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "runtime/hash_table.h"
 #include "runtime/logging.h"
 
-constexpr const char *TUNNELD_CONFIG = "/qv/tunneld/system/config";
-constexpr const char *SYSTEM_MODE = "/qv/tunneld/system/config/mode";
-constexpr const char *SYSTEM_CONFIG = "/qv/wccpd/system/config";
-constexpr const char *MCAST_TTL = "/qv/wccpd/system/config/mcast_ttl";
-constexpr const char *GROUP_CONFIG = "/qv/wccpd/wccp/srv_grp/config";
-constexpr const char *GROUP_ROOTS = "/qv/wccpd/wccp/srv_grp/config/*";
-constexpr const char *POLICY_CONFIG = "/qv/wccpd/wccp/policy_grp/config";
-constexpr const char *POLICY_ROOTS = "/qv/wccpd/wccp/policy_grp/config/*";
-constexpr const char *FACILITY = "/logging/syslog/facility/system";
+constexpr const char *GROUP_ROOTS = NODE_GROUP_CONFIG "/*";
+constexpr const char *POLICY_ROOTS = NODE_POLICY_CONFIG "/*";
 constexpr const char *CONFIG_PREFIX = "WCCP config: ";
 constexpr uint16_t ORPHANED_POLICY = 300; // where the members of a deleted policy group go
 
@@ -499,7 +493,7 @@ static lc_status change_facility(const bn_binding *binding) {
 }
 
 static lc_status change_global(const char *name, const bn_binding *binding) {
-    if (strcmp(name, MCAST_TTL) != 0) {
+    if (strcmp(name, NODE_MCAST_TTL) != 0) {
         QV_LOG(LC_LOG_ERR, "WCCP update: Unknown global binding %s", name);
         return LC_OK;
     }
@@ -547,25 +541,25 @@ static lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_bin
     owned_tstr_array parts;
     CHECK_STATUS(bn_binding_name_to_parts(name, &parts.pointer, nullptr));
     LC_LOG(LC_LOG_INFO, "%s: updating %s", __func__, name);
-    if (strcmp(name, FACILITY) == 0) {
+    if (strcmp(name, NODE_SYSTEM_FACILITY) == 0) {
         CHECK_STATUS(change_facility(binding));
         return LC_OK;
     }
-    if (!wccpd_is_under(name, "/qv/wccpd") && strcmp(name, SYSTEM_MODE) != 0) {
+    if (!wccpd_is_under(name, NODE_WCCPD) && strcmp(name, NODE_SYSTEM_MODE) != 0) {
         LC_LOG(LC_LOG_DEBUG, "%s: %s not for us, discarding", __func__, name);
         return LC_OK;
     }
     bool deleted = false;
     CHECK_STATUS(is_deleted(binding, &deleted));
-    if (wccpd_is_under(name, SYSTEM_CONFIG)) {
+    if (wccpd_is_under(name, NODE_WCCPD_CONFIG)) {
         CHECK_STATUS(change_global(name, binding));
-    } else if (wccpd_is_under(name, GROUP_CONFIG)) {
+    } else if (wccpd_is_under(name, NODE_GROUP_CONFIG)) {
         CHECK_STATUS(change_group(name, parts.pointer, binding, deleted));
-    } else if (strcmp(name, SYSTEM_MODE) == 0) {
+    } else if (strcmp(name, NODE_SYSTEM_MODE) == 0) {
         owned_tstring mode;
         CHECK_STATUS(read_text(binding, &mode));
         (void)wccp_system_mode_change_event(ts_str(mode.pointer));
-    } else if (!wccpd_is_under(name, POLICY_CONFIG)) {
+    } else if (!wccpd_is_under(name, NODE_POLICY_CONFIG)) {
         QV_LOG(LC_LOG_INFO, "WCCP update: Unsupported binding %s", name);
     }
     return LC_OK;
@@ -603,18 +597,18 @@ static lc_status query_roots(const char *root, const char *pattern, mdc_foreach_
 
 lc_status wccpd_config_query() {
     memset(svc_grp_policy, 0, sizeof svc_grp_policy);
-    CHECK_STATUS(query_nodes(TUNNELD_CONFIG));
-    CHECK_STATUS(query_nodes(SYSTEM_CONFIG));
+    CHECK_STATUS(query_nodes(NODE_SYSTEM_CONFIG));
+    CHECK_STATUS(query_nodes(NODE_WCCPD_CONFIG));
     (void)qv_init_log_level(wccpd_mcc);
-    CHECK_STATUS(query_roots(POLICY_CONFIG, POLICY_ROOTS, wccpd_config_policy_update_handler));
-    CHECK_STATUS(query_roots(GROUP_CONFIG, GROUP_ROOTS, wccpd_config_update_handler));
+    CHECK_STATUS(query_roots(NODE_POLICY_CONFIG, POLICY_ROOTS, wccpd_config_policy_update_handler));
+    CHECK_STATUS(query_roots(NODE_GROUP_CONFIG, GROUP_ROOTS, wccpd_config_update_handler));
     return LC_OK;
 }
 
 lc_status wccpd_config_apply_to_log(const bn_binding_array *new_values) {
     (void)qv_handle_log_level_change(new_values);
     const bn_binding *facility = nullptr;
-    CHECK_STATUS(bn_binding_array_get_binding_by_name(new_values, FACILITY, &facility));
+    CHECK_STATUS(bn_binding_array_get_binding_by_name(new_values, NODE_SYSTEM_FACILITY, &facility));
     if (facility)
         CHECK_STATUS(change_facility(facility));
     return LC_OK;
@@ -636,7 +630,8 @@ lc_status wccpd_config_apply(bn_binding_array *new_values) {
 
 static lc_status read_system_mode(owned_tstring *out) {
     owned_binding binding;
-    CHECK_STATUS(mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, SYSTEM_MODE, nullptr));
+    CHECK_STATUS(
+        mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, NODE_SYSTEM_MODE, nullptr));
     CHECK_NULL(binding.pointer);
     CHECK_STATUS(read_text(binding.pointer, out));
     return LC_OK;

@@ -6,12 +6,9 @@
 #include "daemon/wccpd_mgmt.h"
 #include "engine/wccp_host.h"
 #include "mgmt/mdc_main.h"
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
-
-constexpr const char *BONDING = "/qv/tunneld/system/config/bonding";
-constexpr const char *TEN_GIGABIT = "/qv/tunneld/system/config/10g";
-constexpr const char *MODE = "/qv/tunneld/system/config/mode";
 
 int32_t bonding_enabled;
 char wccp_primary_wan_interface_name[32];
@@ -33,14 +30,14 @@ static lc_status read_bool(mdc *handle, const char *node, int32_t *out, bool *ou
 static lc_status mgmt_is_bonding_enabled(mdc *handle, int32_t *out) {
     bool present = false;
     *out = 0;
-    CHECK_STATUS(read_bool(handle, BONDING, out, &present));
+    CHECK_STATUS(read_bool(handle, NODE_SYSTEM_BONDING, out, &present));
     return LC_OK;
 }
 
 static lc_status mgmt_is_10g_enabled(mdc *handle, int32_t *out) {
     bool present = false;
     *out = 0;
-    CHECK_STATUS(read_bool(handle, TEN_GIGABIT, out, &present));
+    CHECK_STATUS(read_bool(handle, NODE_SYSTEM_10G, out, &present));
     return LC_OK;
 }
 
@@ -66,11 +63,12 @@ static lc_status choose_name(const char *mode, const char **out_name) {
 
 lc_status wccp_init_primary_wan_interface() {
     bool present = false;
-    CHECK_STATUS(read_bool(wccpd_mcc, BONDING, &bonding_enabled, &present));
+    CHECK_STATUS(read_bool(wccpd_mcc, NODE_SYSTEM_BONDING, &bonding_enabled, &present));
     if (present)
         LC_LOG(LC_LOG_INFO, "bonding_enabled: %s", lc_bool_to_str(bonding_enabled));
     owned_binding binding;
-    CHECK_STATUS(mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, MODE, nullptr));
+    CHECK_STATUS(
+        mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, NODE_SYSTEM_MODE, nullptr));
     CHECK_NULL(binding.pointer);
     owned_tstring mode;
     CHECK_STATUS(bn_binding_get_tstr(binding.pointer, bn_attrib_value, bn_type_str, nullptr, &mode.pointer));

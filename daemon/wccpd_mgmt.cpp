@@ -15,6 +15,7 @@
 #include "engine/wccp_host.h"
 #include "mgmt/client_session.h"
 #include "mgmt/log_sync.h"
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
 
@@ -114,10 +115,10 @@ static const struct {
     const char *name;
     lc_status (*handle)(const char *event_name, bn_binding_array *bindings);
 } wccpd_events[] = {
-    {"/mgmtd/notify/dbchange", wccpd_config_changed},
-    {"/pm/events/failure/crash", wccpd_proc_event},
-    {"/pm/events/failure/unexpected_exit", wccpd_proc_event},
-    {"/pm/events/proc/terminate", wccpd_proc_event},
+    {EVENT_CONFIG_CHANGE, wccpd_config_changed},
+    {EVENT_PROCESS_CRASH, wccpd_proc_event},
+    {EVENT_PROCESS_EXIT, wccpd_proc_event},
+    {EVENT_PROCESS_TERMINATE, wccpd_proc_event},
 };
 
 static lc_status wccpd_mgmt_handle_event_request(gcl_session *, bn_request_msg *request, void *) {
@@ -150,22 +151,22 @@ static lc_status wccpd_mgmt_handle_session_close(int, uint32_t, void *, void *) 
 }
 
 static lc_status wccpd_mgmt_register_interests() {
-    constexpr const char *ADD = "/mgmtd/events/actions/interest/add";
     CHECK_STATUS(mdc_send_action_with_bindings_str_va(
-        wccpd_mcc, nullptr, nullptr, ADD, 5,                                                        //
-        "event_name", static_cast<uint32_t>(bn_type_name), "/mgmtd/notify/dbchange",                //
-        "match/1/pattern", static_cast<uint32_t>(bn_type_str), "/qv/wccpd/**",                      //
-        "match/2/pattern", static_cast<uint32_t>(bn_type_str), "/qv/tunneld/system/config/mode/**", //
-        "match/3/pattern", static_cast<uint32_t>(bn_type_str), "/logging/**",                       //
-        "match/4/pattern", static_cast<uint32_t>(bn_type_str), "/logging/syslog/facility/**"));
+        wccpd_mcc, nullptr, nullptr, ACTION_ADD_INTEREST, 5,                           //
+        "event_name", static_cast<uint32_t>(bn_type_name), EVENT_CONFIG_CHANGE,        //
+        "match/1/pattern", static_cast<uint32_t>(bn_type_str), NODE_WCCPD "/**",       //
+        "match/2/pattern", static_cast<uint32_t>(bn_type_str), NODE_SYSTEM_MODE "/**", //
+        "match/3/pattern", static_cast<uint32_t>(bn_type_str), "/logging/**",          //
+        "match/4/pattern", static_cast<uint32_t>(bn_type_str), NODE_SYSLOG_FACILITY "/**"));
     static const char *const process_events[] = {
-        "/pm/events/failure/crash",
-        "/pm/events/failure/unexpected_exit",
-        "/pm/events/proc/terminate",
+        EVENT_PROCESS_CRASH,
+        EVENT_PROCESS_EXIT,
+        EVENT_PROCESS_TERMINATE,
     };
     for (const char *event : process_events)
-        CHECK_STATUS(mdc_send_action_with_bindings_str_va(wccpd_mcc, nullptr, nullptr, ADD, 1, "event_name",
-                                                          static_cast<uint32_t>(bn_type_name), event));
+        CHECK_STATUS(mdc_send_action_with_bindings_str_va(wccpd_mcc, nullptr, nullptr, ACTION_ADD_INTEREST, 1,
+                                                          "event_name", static_cast<uint32_t>(bn_type_name),
+                                                          event));
     CHECK_STATUS(qv_register_time_zone_change(wccpd_mcc));
     return LC_OK;
 }

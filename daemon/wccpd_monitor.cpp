@@ -19,13 +19,11 @@
 #include "engine/wccp_debug_utils.h"
 #include "engine/wccp_query.h"
 #include "engine/wccp_utils.h"
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "runtime/csys.h"
 #include "runtime/logging.h"
 #include "runtime/version.h"
-
-#define STATE_ROOT "/qv/wccpd/wccp/srv_grp/state"
-#define SYSTEM_STATE "/qv/wccpd/system/state"
 
 // Parts of a name below the state root, counted from 0.
 enum : uint32_t { GROUP_PART = 5, NUMBER_PART = 7, ADDRESS_PART = 9 };
@@ -87,42 +85,47 @@ static const mon_dump assignment_dump = {
 
 // First match wins.
 static const mon_node mon_nodes[] = {
-    {SYSTEM_STATE "/proto_ver", bn_type_str, VALUE(put_words(out, "2.0")), nullptr},
-    {SYSTEM_STATE "/version", bn_type_str, VALUE(put_words(out, wccp_version())), nullptr},
-    {STATE_ROOT "/*/oper", bn_type_str, VALUE(put_words(out, s->group_info.oper)), nullptr},
-    {STATE_ROOT "/*/uptime", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->group_info.uptime)),
+    {NODE_WCCPD_STATE "/proto_ver", bn_type_str, VALUE(put_words(out, "2.0")), nullptr},
+    {NODE_WCCPD_STATE "/version", bn_type_str, VALUE(put_words(out, wccp_version())), nullptr},
+    {NODE_GROUP_STATE "/*/oper", bn_type_str, VALUE(put_words(out, s->group_info.oper)), nullptr},
+    {NODE_GROUP_STATE "/*/uptime", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->group_info.uptime)),
      nullptr},
-    {STATE_ROOT "/*/app_id", bn_type_str, VALUE(address_text(s->group_info.appliance_ipa, out)), nullptr},
-    {STATE_ROOT "/*/num_routers", bn_type_uint32, VALUE(put_number(out, s->group_info.num_routers)), nullptr},
-    {STATE_ROOT "/*/num_appliances", bn_type_uint32, VALUE(put_number(out, s->group_info.num_appliances)),
+    {NODE_GROUP_STATE "/*/app_id", bn_type_str, VALUE(address_text(s->group_info.appliance_ipa, out)),
      nullptr},
-    {STATE_ROOT "/*/router/*/state", bn_type_str, VALUE(put_words(out, s->router.state)), nullptr},
-    {STATE_ROOT "/*/router/*/fwd_method", bn_type_str, VALUE(put_words(out, s->router.fwd)), nullptr},
-    {STATE_ROOT "/*/router/*/assign_method", bn_type_str, VALUE(put_words(out, s->router.assign)), nullptr},
-    {STATE_ROOT "/*/router/*/ret_method", bn_type_str, VALUE(put_words(out, s->router.ret)), nullptr},
-    {STATE_ROOT "/*/router/*/id", bn_type_ipv4addr, VALUE(address_text(s->router.router_id, out)), nullptr},
-    {STATE_ROOT "/*/router/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->router.src_ipa, out)), nullptr},
-    {STATE_ROOT "/*/router/*/conn_time", bn_type_duration_ms,
+    {NODE_GROUP_STATE "/*/num_routers", bn_type_uint32, VALUE(put_number(out, s->group_info.num_routers)),
+     nullptr},
+    {NODE_GROUP_STATE "/*/num_appliances", bn_type_uint32,
+     VALUE(put_number(out, s->group_info.num_appliances)), nullptr},
+    {NODE_GROUP_STATE "/*/router/*/state", bn_type_str, VALUE(put_words(out, s->router.state)), nullptr},
+    {NODE_GROUP_STATE "/*/router/*/fwd_method", bn_type_str, VALUE(put_words(out, s->router.fwd)), nullptr},
+    {NODE_GROUP_STATE "/*/router/*/assign_method", bn_type_str, VALUE(put_words(out, s->router.assign)),
+     nullptr},
+    {NODE_GROUP_STATE "/*/router/*/ret_method", bn_type_str, VALUE(put_words(out, s->router.ret)), nullptr},
+    {NODE_GROUP_STATE "/*/router/*/id", bn_type_ipv4addr, VALUE(address_text(s->router.router_id, out)),
+     nullptr},
+    {NODE_GROUP_STATE "/*/router/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->router.src_ipa, out)),
+     nullptr},
+    {NODE_GROUP_STATE "/*/router/*/conn_time", bn_type_duration_ms,
      VALUE(put_seconds_as_ms(out, s->router.conn_time)), nullptr},
-    {STATE_ROOT "/*/router/*/appliance/*/load_dist", bn_type_uint32,
+    {NODE_GROUP_STATE "/*/router/*/appliance/*/load_dist", bn_type_uint32,
      VALUE(snprintf(out->text, sizeof out->text, "%u", s->load_percent)), nullptr},
-    {STATE_ROOT "/*/appliance/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->appliance.ipa, out)),
+    {NODE_GROUP_STATE "/*/appliance/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->appliance.ipa, out)),
      nullptr},
-    {STATE_ROOT "/*/appliance/*/weight", bn_type_uint32, VALUE(put_number(out, s->appliance.weight)),
+    {NODE_GROUP_STATE "/*/appliance/*/weight", bn_type_uint32, VALUE(put_number(out, s->appliance.weight)),
      nullptr},
-    {STATE_ROOT "/*/debug", bn_type_str, nullptr, &group_dump},
-    {STATE_ROOT "/*/assignment", bn_type_str, nullptr, &assignment_dump},
-    {SYSTEM_STATE "/debug_global", bn_type_str, nullptr, &global_dump},
-    {SYSTEM_STATE "/debug_all", bn_type_str, nullptr, &all_dump},
-    {SYSTEM_STATE "/is_alive", bn_type_str,
+    {NODE_GROUP_STATE "/*/debug", bn_type_str, nullptr, &group_dump},
+    {NODE_GROUP_STATE "/*/assignment", bn_type_str, nullptr, &assignment_dump},
+    {NODE_WCCPD_STATE "/debug_global", bn_type_str, nullptr, &global_dump},
+    {NODE_WCCPD_STATE "/debug_all", bn_type_str, nullptr, &all_dump},
+    {NODE_WCCPD_STATE "/is_alive", bn_type_str,
      VALUE(put_words(out, lc_enum_to_string(wccpd_status_table, m_daemon_status))), nullptr},
 };
 
 // Nodes that exist so that what iterate finds can be listed; they answer with their own last part.
 static const char *const wildcard_nodes[] = {
-    STATE_ROOT "/*",
-    STATE_ROOT "/*/router/*",
-    STATE_ROOT "/*/router/*/appliance/*",
+    NODE_GROUP_STATE "/*",
+    NODE_GROUP_STATE "/*/router/*",
+    NODE_GROUP_STATE "/*/router/*/appliance/*",
 };
 
 static bool matches(const mon_subject *subject, const char *pattern) {
@@ -151,14 +154,14 @@ static lc_status wccpd_mon_handle_get_wildcard(const mon_subject *subject, const
 static lc_status ask_engine(mon_subject *subject, bool *answered) {
     char routers[64], appliances[64], router_appliances[96];
     *answered = true;
-    if (!wccpd_is_under(subject->name, STATE_ROOT))
+    if (!wccpd_is_under(subject->name, NODE_GROUP_STATE))
         return LC_OK;
     subject->group = static_cast<uint8_t>(number_part(subject, GROUP_PART));
     const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
     const int group = static_cast<int>(group_text ? strtol(group_text, nullptr, 10) : 0);
     // The parents themselves count as well: a get of one finds no number behind it.
-    snprintf(routers, sizeof routers, "%s/%d/router", STATE_ROOT, group);
-    snprintf(appliances, sizeof appliances, "%s/%d/appliance", STATE_ROOT, group);
+    snprintf(routers, sizeof routers, "%s/%d/router", NODE_GROUP_STATE, group);
+    snprintf(appliances, sizeof appliances, "%s/%d/appliance", NODE_GROUP_STATE, group);
     if (!lc_is_prefix(routers, subject->name, 0)) {
         const int status = wccp_get_grp_info(subject->group, &subject->group_info);
         if (status != 0) {
@@ -169,8 +172,8 @@ static lc_status ask_engine(mon_subject *subject, bool *answered) {
     } else {
         subject->router.router_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
         CHECK_STATUS(wccp_get_grp_router_info(subject->group, &subject->router));
-        snprintf(router_appliances, sizeof router_appliances, "%s/%d/router/%d/appliance", STATE_ROOT, group,
-                 static_cast<int>(subject->router.router_num));
+        snprintf(router_appliances, sizeof router_appliances, "%s/%d/router/%d/appliance", NODE_GROUP_STATE,
+                 group, static_cast<int>(subject->router.router_num));
         if (lc_is_prefix(router_appliances, subject->name, 0) &&
             !tstr_array_get_str_quick(subject->parts, ADDRESS_PART)) {
             LC_LOG(LC_LOG_ERR, "Appliance number (at 9th) not found in %s", subject->name);
@@ -223,7 +226,7 @@ static lc_status append_dump(const mon_subject *subject, const mon_node *node, b
 lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_parts, void *,
                                bn_binding_array *out) {
     LC_LOG(LC_LOG_INFO, "MonGet %s", node_name);
-    if (!wccpd_is_under(node_name, "/qv/wccpd")) {
+    if (!wccpd_is_under(node_name, NODE_WCCPD)) {
         LC_LOG(LC_LOG_INFO, "MonGet not for wccpd, bailing - %s", node_name);
         return LC_OK;
     }
@@ -326,9 +329,9 @@ lc_status wccpd_mon_handle_iterate(const char *node_name, const tstr_array *name
         const char *pattern;
         lc_status (*children)(const mon_subject *subject, tstr_array *out);
     } parents[] = {
-        {STATE_ROOT "/*/router/*/appliance", iterate_router_appliances},
-        {STATE_ROOT "/*/router", iterate_routers},
-        {STATE_ROOT, iterate_groups},
+        {NODE_GROUP_STATE "/*/router/*/appliance", iterate_router_appliances},
+        {NODE_GROUP_STATE "/*/router", iterate_routers},
+        {NODE_GROUP_STATE, iterate_groups},
     };
     LC_LOG(LC_LOG_DEBUG, "iterate %s", node_name);
     mon_subject subject = {};

@@ -15,6 +15,7 @@
 
 #include "engine/wccp_router_utils.h"
 #include "engine/wccp_utils.h"
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "platform/qvcommon_transport.h"
 #include "runtime/guards.h"
@@ -59,9 +60,10 @@ struct alarm_kind {
     const char *cleared;
 };
 const alarm_kind alarm_kinds[] = {
-    {WCCP_ALARM_ADJACENCY, 0x3001E, "WCCP GRP %d: alarm: raising adjacency down alarm",
+    {WCCP_ALARM_ADJACENCY, ALARM_TYPE_ADJACENCY, "WCCP GRP %d: alarm: raising adjacency down alarm",
      "WCCP GRP %d: alarm: clearing adjacency down alarm"},
-    {WCCP_ALARM_ASSIGNMENT, 0x3001F, "WCCP GRP %d: alarm: raising assignment table mismatch alarm",
+    {WCCP_ALARM_ASSIGNMENT, ALARM_TYPE_ASSIGNMENT,
+     "WCCP GRP %d: alarm: raising assignment table mismatch alarm",
      "WCCP GRP %d: alarm: clearing assignment table alarm"},
 };
 const alarm_kind *find_kind(uint16_t bit) {
@@ -119,13 +121,13 @@ void tell_alarm(wccp_service_group *group, const alarm_kind *kind, const char *e
 
 void wccp_alarm_raise_alarm(wccp_service_group *group, uint16_t bit) {
     if (const alarm_kind *kind = find_kind(bit))
-        tell_alarm(group, kind, "/qv/alarms/events/raise_alarm", kind->raised);
+        tell_alarm(group, kind, EVENT_RAISE_ALARM, kind->raised);
     group->raised_alarms |= bit;
 }
 
 void wccp_alarm_clear_alarm(wccp_service_group *group, uint16_t bit) {
     if (const alarm_kind *kind = find_kind(bit))
-        tell_alarm(group, kind, "/qv/alarms/events/clear_alarm", kind->cleared);
+        tell_alarm(group, kind, EVENT_CLEAR_ALARM, kind->cleared);
     group->raised_alarms = static_cast<uint16_t>(group->raised_alarms & ~bit);
 }
 
@@ -170,7 +172,7 @@ int qv_state_event_transport(uint32_t one, const char *group_id, uint32_t role, 
         {"role", bn_type_uint32, role_text},
         {"code", bn_type_uint32, code_text},
     };
-    return send_event("/qv/state/events/role_change", fields) == LC_OK ? 0 : 1;
+    return send_event(EVENT_ROLE_CHANGE, fields) == LC_OK ? 0 : 1;
 }
 
 // The checks.

@@ -4,22 +4,21 @@
 #include <cstdio>
 #include <cstring>
 
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
 #include "runtime/ttime.h"
 
-#define MESSAGES_FILE "/logging/syslog/action/file/\\/var\\/log\\/messages"
+#define MESSAGES_FILE NODE_SYSLOG "/action/file/\\/var\\/log\\/messages"
 constexpr const char *SYSTEM_LEVEL = MESSAGES_FILE "/facility/all/min_priority";
 constexpr const char *OVERRIDE_ENABLE = MESSAGES_FILE "/facility/override/enable";
-constexpr const char *TIME_ZONE_EVENT = "/time/notify/zonechange";
 
 struct node_name {
     char text[160];
 };
 static node_name process_level_node() {
     node_name name;
-    snprintf(name.text, sizeof name.text, "/logging/syslog/process/%s/log_level",
-             lc_log_get_lls_process_name());
+    snprintf(name.text, sizeof name.text, NODE_SYSLOG "/process/%s/log_level", lc_log_get_lls_process_name());
     return name;
 }
 // local0 is 0, local1 is 1.
@@ -87,8 +86,8 @@ lc_status qv_init_log_level(mdc *session) {
 // What the log asks when it is given a session.
 lc_status qv_read_log_facility(mdc *session, uint32_t *out_facility) {
     owned_binding binding;
-    CHECK_STATUS(mdc_get_binding(session, nullptr, nullptr, 0, &binding.pointer,
-                                 "/logging/syslog/facility/system", nullptr));
+    CHECK_STATUS(
+        mdc_get_binding(session, nullptr, nullptr, 0, &binding.pointer, NODE_SYSTEM_FACILITY, nullptr));
     CHECK_NULL(binding.pointer);
     CHECK_STATUS(bn_binding_get_uint32(binding.pointer, bn_attrib_value, nullptr, out_facility));
     return LC_OK;
@@ -189,14 +188,14 @@ lc_status qv_handle_log_level_change(const bn_binding_array *bindings) {
 // ------------------------------------------------------------------------------------------------------
 
 lc_status qv_register_time_zone_change(mdc *session) {
-    CHECK_STATUS(mdc_send_action_with_bindings_str_va(session, nullptr, nullptr,
-                                                      "/mgmtd/events/actions/interest/add", 1, "event_name",
-                                                      static_cast<uint32_t>(bn_type_name), TIME_ZONE_EVENT));
+    CHECK_STATUS(mdc_send_action_with_bindings_str_va(session, nullptr, nullptr, ACTION_ADD_INTEREST, 1,
+                                                      "event_name", static_cast<uint32_t>(bn_type_name),
+                                                      EVENT_TIME_ZONE));
     return LC_OK;
 }
 
 lc_status qv_handle_time_zone_change(const char *event_name) {
-    if (!event_name || strcmp(event_name, TIME_ZONE_EVENT) != 0)
+    if (!event_name || strcmp(event_name, EVENT_TIME_ZONE) != 0)
         return LC_NOT_FOUND;
     CHECK_STATUS(lt_timezone_handle_changed());
     LC_LOG(LC_LOG_INFO, "Time zone change handled OK");

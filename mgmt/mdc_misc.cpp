@@ -8,6 +8,7 @@
 
 #include "mgmt/mdc_main.h"
 #include "mgmt/mdc_remote_reg.h"
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
 
@@ -271,7 +272,7 @@ lc_status mdc_dispatch_mon_request(gcl_session *session, bn_request_msg *request
 // --- The change event
 // -----------------------------------------------------------------------------------------------
 
-constexpr const char *CHANGE_PATTERN = "/mgmtd/notification/dbchange/*";
+constexpr const char *CHANGE_PATTERN = EVENT_CHANGES "/*";
 constexpr uint32_t CHANGE_PARTS = 4;
 
 struct change_entry {

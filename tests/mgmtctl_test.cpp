@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/nodes.h"
 #include "peers/mgmtctl/render.h"
 #include "peers/mgmtctl/watch.h"
@@ -42,7 +43,7 @@ TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
 
 TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
     const std::string entry = "/mgmtd/notification/dbchange/";
-    const ctl_event change = {CHANGE_EVENT,
+    const ctl_event change = {EVENT_CONFIG_CHANGE,
                               {{entry + "09", "uint32", "9"},
                                {entry + "09/change_type", "string", "modify"},
                                {entry + "09/name", "string", G51 + "/password"},

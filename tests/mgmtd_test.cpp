@@ -13,6 +13,7 @@
 
 #include "mgmt/bnode_proto.h"
 #include "mgmt/mdc_main.h"
+#include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 #include "peers/mgmtd/supervise.h"
 
@@ -140,7 +141,7 @@ struct Mgmtd : testing::Test {
         server_peer_opened(&daemon, 2, "wccpd-7"); // the alarm session
         server_peer_opened(&daemon, 3, "mgmtctl-8");
         action(1, "/mgmtd/events/actions/interest/add",
-               {{"event_name", {bn_type_name, CHANGE_EVENT}},
+               {{"event_name", {bn_type_name, EVENT_CONFIG_CHANGE}},
                 {"match/1/pattern", {bn_type_str, "/qv/wccpd/**"}},
                 {"match/2/pattern", {bn_type_str, "/qv/tunneld/system/config/mode/**"}}});
         EXPECT_EQ(code(), 0u);
@@ -238,7 +239,7 @@ struct Mgmtd : testing::Test {
         for (const sent_message &one : sent) {
             if (one.peer != 1 || one.mtype != bn_msg_event)
                 continue;
-            EXPECT_STREQ(ts_str(one.request->text), CHANGE_EVENT);
+            EXPECT_STREQ(ts_str(one.request->text), EVENT_CONFIG_CHANGE);
             owned_bindings bindings, old_values, new_values;
             EXPECT_EQ(bn_request_get(one.request, nullptr, nullptr, 0, &bindings.pointer, nullptr, nullptr),
                       LC_OK);

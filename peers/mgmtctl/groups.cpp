@@ -24,14 +24,12 @@
 #include <unistd.h>
 
 #include "mgmt/bnode_types.h"
+#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/edit_distance.h"
 #include "peers/mgmtctl/render.h"
 #include "peers/nodes/schema.h"
 #include "runtime/common.h"
 
-static const char *const GROUPS = "/qv/wccpd/wccp/srv_grp/config";
-static const char *const POLICIES = "/qv/wccpd/wccp/policy_grp/config";
-static const char *const STATES = "/qv/wccpd/wccp/srv_grp/state";
 static constexpr size_t SECRET_MAX = 256; // more than any password has; mgmtd says what is too long
 static const char *const TRIAL_END = "/mgmtctl/this/is/only/a/trial";
 
@@ -64,7 +62,8 @@ const std::vector<group_word> &group_words() {
 
 static const schema_row *row_of(const group_word &word) {
     node_name name;
-    return parse_node_name(std::string(GROUPS) + "/0/" + word.node, &name) ? find_schema_row(name) : nullptr;
+    return parse_node_name(std::string(NODE_GROUP_CONFIG) + "/0/" + word.node, &name) ? find_schema_row(name)
+                                                                                      : nullptr;
 }
 
 // What mgmtd has in the place of a node that isn't set; null: the node is absent then.
@@ -313,12 +312,12 @@ static void recreate(const group_link &link, const std::string &root, const grou
 static void settle(const group_link &link, bool wanted, group_result *inout) {
     using clock = std::chrono::steady_clock;
     const auto until = clock::now() + std::chrono::milliseconds(link.settle_ms);
-    const std::string root = root_of(STATES, inout->number);
+    const std::string root = root_of(NODE_GROUP_STATE, inout->number);
     std::string reason;
     ctl_reply reply;
     for (;;) {
         reply = {};
-        if (!link.query(ctl_walk::children, STATES, &reply, &reason)) {
+        if (!link.query(ctl_walk::children, NODE_GROUP_STATE, &reply, &reason)) {
             inout->note = reason;
             return;
         }
@@ -470,7 +469,7 @@ group_result group_command(const group_link &link, const std::vector<std::string
         return failed(result, CTL_USAGE, GROUP_USAGE);
     if (const std::string wrong = parse_wish(words, &wish); !wrong.empty())
         return failed(result, CTL_USAGE, wrong);
-    const std::string root = root_of(GROUPS, result.number);
+    const std::string root = root_of(NODE_GROUP_CONFIG, result.number);
     if (verb == "add") {
         group_add(link, root, wish, &result);
     } else if (verb == "set") {
@@ -489,9 +488,9 @@ group_result group_command(const group_link &link, const std::vector<std::string
 static std::string members_of(const group_link &link, long number) {
     ctl_reply reply;
     std::string reason, out;
-    if (!link.query(ctl_walk::subtree, GROUPS, &reply, &reason))
+    if (!link.query(ctl_walk::subtree, NODE_GROUP_CONFIG, &reply, &reason))
         return "";
-    const size_t above = std::string(GROUPS).size() + 1;
+    const size_t above = std::string(NODE_GROUP_CONFIG).size() + 1;
     for (const ctl_binding &binding : reply.bindings)
         if (binding.name.ends_with("/policy_grp") && binding.value == std::to_string(number))
             out += " " + binding.name.substr(above, binding.name.find('/', above) - above);
@@ -511,7 +510,7 @@ group_result policy_command(const group_link &link, const std::vector<std::strin
         return failed(result, CTL_USAGE, USAGE);
     if (words.size() == 4 && words[2] != "name")
         return failed(result, CTL_USAGE, unknown_word(words[2], {"name"}));
-    const std::string root = root_of(POLICIES, result.number);
+    const std::string root = root_of(NODE_POLICY_CONFIG, result.number);
     if (verb == "delete") {
         remove_root(link, root, &result);
         if (const std::string members = members_of(link, result.number);
@@ -704,9 +703,9 @@ int ctl_group(const ctl_options &options, const std::vector<std::string> &words)
     for (size_t i = 3; i < filled.size(); i += 2)
         if (filled[i - 1] == "password" && filled[i] == "-" && !read_secret(&filled[i]))
             return tell_failure(options, {CTL_USAGE, "", "there is no password on standard input", "", 0});
-    return run(options, filled, GROUPS, "group", group_command);
+    return run(options, filled, NODE_GROUP_CONFIG, "group", group_command);
 }
 
 int ctl_policy(const ctl_options &options, const std::vector<std::string> &words) {
-    return run(options, words, POLICIES, "policy group", policy_command);
+    return run(options, words, NODE_POLICY_CONFIG, "policy group", policy_command);
 }

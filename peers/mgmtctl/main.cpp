@@ -17,6 +17,7 @@
 #include <poll.h>
 #include <unistd.h>
 
+#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/nodes.h"
 #include "peers/mgmtctl/render.h"
 #include "peers/mgmtctl/watch.h"
@@ -191,7 +192,7 @@ static int alarms(const ctl_options &options, bool check) {
     if (!mgmtd.session)
         return mgmtd.code;
     ctl_reply reply;
-    if (!mgmtd.ask(ctl_walk::subtree, ALARM_ROOT, &reply))
+    if (!mgmtd.ask(ctl_walk::subtree, NODE_ALARMS_RAISED, &reply))
         return mgmtd.lost();
     if (reply.code != 0)
         return tell_failure(options, {exit_of(reply.code), "", reply.message, "", reply.code});

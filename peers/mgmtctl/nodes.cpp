@@ -13,11 +13,10 @@
 #include <map>
 
 #include "mgmt/bnode_types.h"
+#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/edit_distance.h"
 #include "peers/mgmtctl/groups.h"
 #include "runtime/common.h"
-
-static const char *const GROUPS = "/qv/wccpd/wccp/srv_grp/config";
 
 static node_name named(const std::string &text) {
     node_name out;
@@ -27,7 +26,7 @@ static node_name named(const std::string &text) {
 
 // The root of the service group that a configuration node belongs to, "" for others.
 static std::string group_of(const std::string &text) {
-    static const node_name groups = named(GROUPS);
+    static const node_name groups = named(NODE_GROUP_CONFIG);
     node_name name = named(text);
     if (!name.is_under(groups))
         return "";
@@ -49,9 +48,9 @@ static const std::vector<node_name> &patterns() {
             made.push_back(row.parts);
         for (const char *pattern : wccpd_state_nodes())
             made.push_back(named(pattern));
-        for (const char *pattern : {"/qv/alarms/state/raised/*/*/name", "/qv/alarms/state/raised/*/*/since",
-                                    "/qv/alarms/state/raised/*/*/reporter", "/qv/alarms/state/role/*/code",
-                                    "/qv/alarms/state/role/*/since"})
+        for (const char *pattern :
+             {NODE_ALARMS_RAISED "/*/*/name", NODE_ALARMS_RAISED "/*/*/since",
+              NODE_ALARMS_RAISED "/*/*/reporter", NODE_ROLES "/*/code", NODE_ROLES "/*/since"})
             made.push_back(named(pattern));
         return made;
     }();
@@ -141,7 +140,7 @@ std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &text) {
     node_name name;
     if (parse_node_name(text, &name) && find_schema_row(name))
         return "";
-    for (const char *root : {"/qv/wccpd/system/state", "/qv/wccpd/wccp/srv_grp/state", "/qv/alarms/state"})
+    for (const char *root : {NODE_WCCPD_STATE, NODE_GROUP_STATE, NODE_ALARM_STATE})
         if (name == named(root) || name.is_under(named(root)))
             return "it is a state: it can only be read";
     return hint_for_missing(ask, text);
@@ -183,7 +182,7 @@ std::vector<std::string> completions(const ctl_ask &ask, const std::string &word
 // --- Appliances of a walk
 
 bool add_appliances(const ctl_ask &ask, const std::string &root_text, std::vector<ctl_binding> *inout) {
-    static const node_name counts = named("/qv/wccpd/wccp/srv_grp/state/*/num_appliances");
+    static const node_name counts = named(NODE_GROUP_STATE "/*/num_appliances");
     const node_name root = named(root_text);
     node_name list = counts;
     list.parts.back() = "appliance";

@@ -11,6 +11,7 @@
 
 #include <unistd.h>
 
+#include "mgmt/node_paths.h"
 #include "peers/nodes/binding_text.h"
 #include "peers/nodes/schema.h"
 #include "runtime/common.h"
@@ -145,7 +146,7 @@ int tell_failure(const ctl_options &options, const ctl_failure &failure) {
 
 std::vector<ctl_alarm> alarms_of(const std::vector<ctl_binding> &bindings) {
     node_name root;
-    (void)parse_node_name(ALARM_ROOT, &root);
+    (void)parse_node_name(NODE_ALARMS_RAISED, &root);
     std::vector<ctl_alarm> out;
     for (const ctl_binding &binding : bindings) {
         node_name name;

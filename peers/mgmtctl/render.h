@@ -6,6 +6,7 @@
 
 #include <nlohmann/json.hpp>
 
+#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/commands.h"
 
 using ctl_json = nlohmann::ordered_json;
@@ -36,8 +37,7 @@ std::string text_failure(const ctl_failure &failure);
 // nothing.
 int tell_failure(const ctl_options &options, const ctl_failure &failure);
 
-// The alarms that stand, from a walk of ALARM_ROOT.
-inline constexpr const char *ALARM_ROOT = "/qv/alarms/state/raised";
+// The alarms that stand, from a walk of NODE_ALARMS_RAISED.
 struct ctl_alarm {
     std::string type, source, name, text, since, reporter;
 };

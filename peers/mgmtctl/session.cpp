@@ -27,6 +27,7 @@
 
 #include "mgmt/bnode_proto.h"
 #include "mgmt/gcl.h"
+#include "mgmt/node_paths.h"
 #include "peers/nodes/binding_text.h"
 #include "peers/nodes/provider_path.h"
 #include "runtime/fdintrcb.h"
@@ -330,7 +331,7 @@ bool ctl_add_interest(ctl_session *session, const std::string &event,
     for (size_t i = 0; i < patterns.size(); i++)
         bindings.push_back({"match/" + std::to_string(i + 1) + "/pattern", "string", patterns[i]});
     ctl_reply reply;
-    if (!ctl_action(session, "/mgmtd/events/actions/interest/add", bindings, &reply, out_reason))
+    if (!ctl_action(session, ACTION_ADD_INTEREST, bindings, &reply, out_reason))
         return false;
     return reply.code == 0 || fail(out_reason, reply.message);
 }

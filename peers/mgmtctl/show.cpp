@@ -20,6 +20,7 @@
 #include <sys/ioctl.h>
 #include <unistd.h>
 
+#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/commands.h"
 #include "peers/mgmtctl/show_picture.h"
 
@@ -192,13 +193,13 @@ static bool add_interests(ctl_session *session, std::string *out_reason) {
         const char *event;
         std::vector<std::string> patterns;
     } wanted[] = {
-        {"/mgmtd/notify/dbchange", {"/qv/wccpd/**", "/qv/tunneld/system/config/mode"}},
-        {"/qv/alarms/events/raise_alarm", {}},
-        {"/qv/alarms/events/clear_alarm", {}},
-        {"/qv/state/events/role_change", {}},
-        {"/pm/events/failure/crash", {}},
-        {"/pm/events/failure/unexpected_exit", {}},
-        {"/pm/events/proc/terminate", {}},
+        {EVENT_CONFIG_CHANGE, {NODE_WCCPD "/**", NODE_SYSTEM_MODE}},
+        {EVENT_RAISE_ALARM, {}},
+        {EVENT_CLEAR_ALARM, {}},
+        {EVENT_ROLE_CHANGE, {}},
+        {EVENT_PROCESS_CRASH, {}},
+        {EVENT_PROCESS_EXIT, {}},
+        {EVENT_PROCESS_TERMINATE, {}},
     };
     return std::all_of(std::begin(wanted), std::end(wanted), [&](const auto &each) {
         return ctl_add_interest(session, each.event, each.patterns, out_reason);

@@ -14,12 +14,9 @@
 
 #include <arpa/inet.h>
 
+#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/render.h"
 #include "runtime/common.h"
-
-static const char *const CONFIGS = "/qv/wccpd/wccp/srv_grp/config";
-static const char *const STATES = "/qv/wccpd/wccp/srv_grp/state";
-static const char *const ROLES = "/qv/alarms/state/role";
 
 static constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
 static constexpr size_t APPLIANCES_MAX = 32;
@@ -171,7 +168,7 @@ static std::string group_root(const char *above, int id) {
 // What is configured; the addresses of its routers go to `out_routers`.
 static bool gather_config(gathering *work, picture_group *group, std::vector<std::string> *out_routers) {
     ctl_reply reply;
-    const std::string root = group_root(CONFIGS, group->id);
+    const std::string root = group_root(NODE_GROUP_CONFIG, group->id);
     if (!work->ask(ctl_walk::subtree, root, &reply))
         return false;
     for (const ctl_binding &binding : reply.bindings) {
@@ -208,7 +205,7 @@ static uint32_t address_order(const std::string &address) {
 static bool gather_routers(gathering *work, picture_group *group,
                            const std::vector<std::string> &configured) {
     ctl_reply reply;
-    const std::string root = group_root(STATES, group->id) + "/router";
+    const std::string root = group_root(NODE_GROUP_STATE, group->id) + "/router";
     if (group->running && !work->ask_wccpd(ctl_walk::subtree, root, &reply))
         return false;
     std::string number;
@@ -250,7 +247,7 @@ static bool gather_routers(gathering *work, picture_group *group,
 
 static bool gather_weights(gathering *work, picture_group *group, uint32_t count) {
     for (uint32_t n = 1; n <= std::min<uint32_t>(count, APPLIANCES_MAX); n++) {
-        const std::string root = group_root(STATES, group->id) + "/appliance/" + std::to_string(n);
+        const std::string root = group_root(NODE_GROUP_STATE, group->id) + "/appliance/" + std::to_string(n);
         ctl_reply address, weight;
         if (!work->ask_wccpd(ctl_walk::node, root + "/ipaddr", &address) ||
             !work->ask_wccpd(ctl_walk::node, root + "/weight", &weight))
@@ -339,7 +336,7 @@ static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
     if (group->configured && !gather_config(work, group, &configured))
         return false;
     group->routers_configured = configured.size();
-    const std::string root = group_root(STATES, group->id);
+    const std::string root = group_root(NODE_GROUP_STATE, group->id);
     if (work->shown.brief)
         return !in_wccpd || gather_briefly(work, group, root);
     ctl_reply reply;
@@ -358,7 +355,7 @@ static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
 
 static bool gather_alarms(gathering *work) {
     ctl_reply reply;
-    if (!work->ask(ctl_walk::subtree, ALARM_ROOT, &reply))
+    if (!work->ask(ctl_walk::subtree, NODE_ALARMS_RAISED, &reply))
         return false;
     const std::vector<ctl_alarm> standing = alarms_of(reply.bindings);
     work->shown.alarms_total = standing.size();
@@ -370,7 +367,7 @@ static bool gather_alarms(gathering *work) {
              clean_text(from.text, 127), clean_text(from.since, 31), clean_text(from.reporter, 63),
              at == std::string::npos ? -1 : number_of(from.source.substr(at + 5), -1)});
     }
-    if (!work->ask(ctl_walk::children, ROLES, &reply))
+    if (!work->ask(ctl_walk::children, NODE_ROLES, &reply))
         return false;
     for (const ctl_binding &binding : reply.bindings) {
         work->shown.roles_active += binding.value == "ACTIVE";
@@ -397,16 +394,16 @@ static void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *
 static void gather(gathering *work) {
     ctl_reply alive, mode, states, configs;
     work->shown.wccpd = picture_wccpd::running;
-    if (!work->ask(ctl_walk::node, "/qv/tunneld/system/config/mode", &mode) || !gather_alarms(work) ||
-        !work->ask(ctl_walk::children, CONFIGS, &configs) ||
-        !work->ask_wccpd(ctl_walk::node, "/qv/wccpd/system/state/is_alive", &alive) ||
-        !work->ask_wccpd(ctl_walk::children, STATES, &states))
+    if (!work->ask(ctl_walk::node, NODE_SYSTEM_MODE, &mode) || !gather_alarms(work) ||
+        !work->ask(ctl_walk::children, NODE_GROUP_CONFIG, &configs) ||
+        !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_STATUS, &alive) ||
+        !work->ask_wccpd(ctl_walk::children, NODE_GROUP_STATE, &states))
         return;
     work->shown.mode = first_value(mode);
     work->shown.status = first_value(alive);
     std::vector<int> configured, running, all;
-    add_ids(CONFIGS, configs, &configured);
-    add_ids(STATES, states, &running);
+    add_ids(NODE_GROUP_CONFIG, configs, &configured);
+    add_ids(NODE_GROUP_STATE, states, &running);
     std::set_union(configured.begin(), configured.end(), running.begin(), running.end(),
                    std::back_inserter(all));
     work->shown.groups_total = all.size();

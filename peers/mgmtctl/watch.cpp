@@ -15,6 +15,7 @@
 #include <poll.h>
 #include <unistd.h>
 
+#include "mgmt/node_paths.h"
 #include "peers/nodes/binding_text.h"
 #include "peers/nodes/schema.h"
 
@@ -112,13 +113,13 @@ static std::string plain_text(const event_row &row, const ctl_event &) {
 }
 
 static const event_row rows[] = {
-    {"/qv/alarms/events/raise_alarm", "alarm_raised", "alarm raised: ", alarm_json, alarm_text},
-    {"/qv/alarms/events/clear_alarm", "alarm_cleared", "alarm cleared: ", alarm_json, alarm_text},
-    {"/qv/state/events/role_change", "role", "role of group ", role_json, role_text},
-    {"/pm/events/failure/crash", "process_crash", " crashed", process_json, process_text},
-    {"/pm/events/failure/unexpected_exit", "process_exit", " ended unexpectedly", process_json, process_text},
-    {"/pm/events/proc/terminate", "process_terminate", " was terminated", process_json, process_text},
-    {"/time/notify/zonechange", "timezone", "the time zone has changed", plain_json, plain_text},
+    {EVENT_RAISE_ALARM, "alarm_raised", "alarm raised: ", alarm_json, alarm_text},
+    {EVENT_CLEAR_ALARM, "alarm_cleared", "alarm cleared: ", alarm_json, alarm_text},
+    {EVENT_ROLE_CHANGE, "role", "role of group ", role_json, role_text},
+    {EVENT_PROCESS_CRASH, "process_crash", " crashed", process_json, process_text},
+    {EVENT_PROCESS_EXIT, "process_exit", " ended unexpectedly", process_json, process_text},
+    {EVENT_PROCESS_TERMINATE, "process_terminate", " was terminated", process_json, process_text},
+    {EVENT_TIME_ZONE, "timezone", "the time zone has changed", plain_json, plain_text},
 };
 
 static const event_row *find_row(const ctl_event &event) {
@@ -135,7 +136,7 @@ static ctl_json json_side(const ctl_binding &side, bool secrets) {
 }
 
 ctl_json json_event(const ctl_event &event, bool secrets) {
-    if (event.name == CHANGE_EVENT) {
+    if (event.name == EVENT_CONFIG_CHANGE) {
         ctl_json changes = ctl_json::array();
         for (const change_entry &entry : changes_of(event))
             changes.push_back({{"name", entry.name},
@@ -154,7 +155,7 @@ ctl_json json_event(const ctl_event &event, bool secrets) {
 }
 
 std::vector<std::string> text_event(const ctl_event &event, bool secrets) {
-    if (event.name == CHANGE_EVENT) {
+    if (event.name == EVENT_CONFIG_CHANGE) {
         std::vector<std::string> out;
         for (const change_entry &entry : changes_of(event)) {
             std::string line = entry.kind + std::string(entry.kind == "add" ? "    " : " ") + entry.name;
@@ -173,7 +174,7 @@ std::vector<std::string> text_event(const ctl_event &event, bool secrets) {
 // --- The word
 
 std::vector<std::string> watched_events() {
-    std::vector<std::string> out = {CHANGE_EVENT};
+    std::vector<std::string> out = {EVENT_CONFIG_CHANGE};
     for (const event_row &row : rows)
         out.emplace_back(row.event);
     return out;
@@ -217,7 +218,7 @@ static int follow(const ctl_options &options, ctl_session *session, const std::v
         patterns.push_back(watch_pattern(name));
     std::string reason;
     for (const std::string &event : watched_events()) {
-        if (event != CHANGE_EVENT && !names.empty())
+        if (event != EVENT_CONFIG_CHANGE && !names.empty())
             break;
         if (!ctl_add_interest(session, event, patterns, &reason))
             return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});

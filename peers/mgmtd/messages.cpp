@@ -1,6 +1,7 @@
 #include "peers/mgmtd/messages.h"
 
 #include "mgmt/bnode_proto.h"
+#include "mgmt/node_paths.h"
 
 // --- Events
 
@@ -26,15 +27,14 @@ bn_request_msg *make_change_event(const std::vector<const node_change *> &change
     if (changes.empty())
         return nullptr;
     owned_request msg;
-    if (bn_event_request_msg_create(&msg.pointer, CHANGE_EVENT) != LC_OK)
+    if (bn_event_request_msg_create(&msg.pointer, EVENT_CONFIG_CHANGE) != LC_OK)
         return nullptr;
     // Readers sort the entries by name: numbers of one width keep the order of the tree.
     const size_t width = std::to_string(changes.size()).size();
     size_t number = 0;
     for (const node_change *change : changes) {
         const std::string digits = std::to_string(++number);
-        const std::string entry =
-            "/mgmtd/notification/dbchange/" + std::string(width - digits.size(), '0') + digits;
+        const std::string entry = EVENT_CHANGES "/" + std::string(width - digits.size(), '0') + digits;
         const char *kind = !change->before ? "add" : !change->after ? "delete" : "modify";
         bool made = append_field(msg.pointer, entry, {bn_type_uint32, std::to_string(number)}) &&
                     append_field(msg.pointer, entry + "/change_type", {bn_type_str, kind}) &&

@@ -5,6 +5,7 @@
 #include <string>
 #include <vector>
 
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "peers/mgmtd/node_tree.h"
 #include "peers/nodes/binding_text.h"
@@ -12,8 +13,8 @@
 // An event; the fields are bindings in their order.
 bn_request_msg *make_event(const std::string &name, const std::vector<event_field> &fields);
 
-// CHANGE_EVENT, which tells of a commit: for each change an entry "/mgmtd/notification/dbchange/N", below it
-// what kind of change, the node, and its value after and before. Null when there is nothing to tell.
+// EVENT_CONFIG_CHANGE, which tells of a commit: for each change an entry "/mgmtd/notification/dbchange/N",
+// below it what kind of change, the node, and its value after and before. Null when there is nothing to tell.
 bn_request_msg *make_change_event(const std::vector<const node_change *> &changes);
 
 // Interest patterns: "*" is one part, "**" at the end is any number of them. Other than in a match of

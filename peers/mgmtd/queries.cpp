@@ -9,6 +9,7 @@
 #include <algorithm>
 
 #include "mgmt/bnode_proto.h"
+#include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 
 namespace {
@@ -20,7 +21,7 @@ struct state_source {
 } // namespace
 
 static const state_source sources[] = {
-    {"wccpd", {"/qv/wccpd/system/state", "/qv/wccpd/wccp/srv_grp/state"}, wccpd_state_nodes},
+    {"wccpd", {NODE_WCCPD_STATE, NODE_GROUP_STATE}, wccpd_state_nodes},
 };
 static constexpr uint32_t CAPABILITIES = 1; // the nodes can be read
 
@@ -30,8 +31,9 @@ static uint32_t find_provider(const server *self, const state_source &source, ui
     uint32_t found = 0;
     uint64_t newest = 0;
     for (const auto &[id, who] : self->peers) {
-        const bool works = std::any_of(who.interests.begin(), who.interests.end(),
-                                       [](const interest &wish) { return wish.event == CHANGE_EVENT; });
+        const bool works = std::any_of(who.interests.begin(), who.interests.end(), [](const interest &wish) {
+            return wish.event == EVENT_CONFIG_CHANGE;
+        });
         if (id != asker && works && who.name.starts_with(prefix) && who.first_seen > newest) {
             newest = who.first_seen;
             found = id;

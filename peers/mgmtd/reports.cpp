@@ -8,6 +8,7 @@
 // cleared: a daemon that is gone watches nothing. Each report is passed on to those with an interest in it.
 #include <ctime>
 
+#include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 #include "peers/nodes/schema.h"
 #include "runtime/ttime.h"
@@ -15,9 +16,6 @@
 // Of what a report says, as much is kept as a person reads; with ALARMS_MAX of them a walk still fits in one
 // message.
 static constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
-
-static const char *const ALARMS = "/qv/alarms/state/raised";
-static const char *const ROLES = "/qv/alarms/state/role";
 
 static node_name named(const char *text) {
     node_name out;
@@ -54,7 +52,9 @@ static std::string text_or(const std::vector<event_field> &fields, const char *n
 }
 
 static node_name alarm_root(const std::vector<event_field> &fields) {
-    return named(ALARMS).below(text_or(fields, "alarm_type", "0")).below(text_or(fields, "param_3", "-"));
+    return named(NODE_ALARMS_RAISED)
+        .below(text_or(fields, "alarm_type", "0"))
+        .below(text_or(fields, "param_3", "-"));
 }
 
 static void take_raise(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
@@ -78,7 +78,7 @@ static void take_clear(server *self, uint32_t, const std::vector<event_field> &f
 }
 
 static void take_role(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
-    const node_name root = named(ROLES).below(text_or(fields, "group", "-"));
+    const node_name root = named(NODE_ROLES).below(text_or(fields, "group", "-"));
     if (!keep_report(self, peer_id, root))
         return;
     const char *role = role_name(text_or(fields, "role", ""));
@@ -95,9 +95,9 @@ static const struct {
     const char *event;
     void (*take)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
 } reports[] = {
-    {"/qv/alarms/events/raise_alarm", take_raise},
-    {"/qv/alarms/events/clear_alarm", take_clear},
-    {"/qv/state/events/role_change", take_role},
+    {EVENT_RAISE_ALARM, take_raise},
+    {EVENT_CLEAR_ALARM, take_clear},
+    {EVENT_ROLE_CHANGE, take_role},
 };
 
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,

@@ -16,6 +16,7 @@
 #include <unistd.h>
 
 #include "mgmt/bnode_proto.h"
+#include "mgmt/node_paths.h"
 
 static constexpr uint16_t SERVICE = 2;
 
@@ -123,9 +124,9 @@ static action_answer remove_interest(server *self, uint32_t peer_id, const std::
 // What happened to a process, told by whoever started it.
 static action_answer report_process(server *self, uint32_t, const std::vector<event_field> &fields) {
     static const std::map<std::string, const char *> events = {
-        {"crash", "/pm/events/failure/crash"},
-        {"unexpected_exit", "/pm/events/failure/unexpected_exit"},
-        {"terminate", "/pm/events/proc/terminate"},
+        {"crash", EVENT_PROCESS_CRASH},
+        {"unexpected_exit", EVENT_PROCESS_EXIT},
+        {"terminate", EVENT_PROCESS_TERMINATE},
     };
     const std::string *process = find_field(fields, "process_name");
     const std::string *kind = find_field(fields, "event");
@@ -139,7 +140,7 @@ static action_answer report_process(server *self, uint32_t, const std::vector<ev
 
 static action_answer report_zone(server *self, uint32_t, const std::vector<event_field> &) {
     self->say("time zone changed");
-    server_send_event(self, "/time/notify/zonechange", {});
+    server_send_event(self, EVENT_TIME_ZONE, {});
     return {};
 }
 
@@ -147,8 +148,8 @@ static const struct {
     const char *name;
     action_answer (*run)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
 } actions[] = {
-    {"/mgmtd/events/actions/interest/add", add_interest},
-    {"/mgmtd/events/actions/interest/remove", remove_interest},
+    {ACTION_ADD_INTEREST, add_interest},
+    {ACTION_REMOVE_INTEREST, remove_interest},
     {"/mgmtd/process/actions/report", report_process},
     {"/mgmtd/time/actions/zonechange", report_zone},
 };
@@ -171,7 +172,7 @@ static void tell_change(server *self, const std::vector<node_change> &changes) {
     for (const auto &[id, who] : self->peers) {
         std::vector<const node_change *> wanted;
         for (const interest &wish : who.interests) {
-            if (wish.event != CHANGE_EVENT)
+            if (wish.event != EVENT_CONFIG_CHANGE)
                 continue;
             for (const node_change &change : changes)
                 if (wish.patterns.empty() ||

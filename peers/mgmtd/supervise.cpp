@@ -16,6 +16,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "mgmt/node_paths.h"
 #include "runtime/common.h"
 
 int64_t next_delay(int64_t before_ms, int64_t ran_ms) {
@@ -26,8 +27,8 @@ int64_t next_delay(int64_t before_ms, int64_t ran_ms) {
 
 const char *end_event(int wait_status, bool ending) {
     if (ending || (WIFSIGNALED(wait_status) && WTERMSIG(wait_status) == SIGTERM))
-        return "/pm/events/proc/terminate";
-    return WIFSIGNALED(wait_status) ? "/pm/events/failure/crash" : "/pm/events/failure/unexpected_exit";
+        return EVENT_PROCESS_TERMINATE;
+    return WIFSIGNALED(wait_status) ? EVENT_PROCESS_CRASH : EVENT_PROCESS_EXIT;
 }
 
 static std::string end_text(int wait_status) {

@@ -17,9 +17,6 @@ struct event_field {
     node_value value;
 };
 
-// The event with which mgmtd tells of a commit.
-inline constexpr const char *CHANGE_EVENT = "/mgmtd/notify/dbchange";
-
 const char *type_name(uint32_t type); // "uint32", "string", "ipv4addr"
 bool type_named(const std::string &name, uint32_t *out_type);
 

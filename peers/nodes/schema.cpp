@@ -13,6 +13,7 @@
 #include <cstring>
 
 #include "mgmt/bnode.h"
+#include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
 #include "peers/nodes/binding_text.h"
 #include "runtime/logging.h"
@@ -47,26 +48,18 @@ static const char *check_interface(const std::string &text) {
     return text.find_first_of("/ \t:") == std::string::npos ? nullptr : "is no interface name";
 }
 
-#define GROUP "/qv/wccpd/wccp/srv_grp/config/*"
-#define POLICY "/qv/wccpd/wccp/policy_grp/config/*"
-#define MESSAGES "/logging/syslog/action/file/*/facility"
-#define MAIN_MESSAGES "/logging/syslog/action/file/\\/var\\/log\\/messages/facility"
+#define GROUP NODE_GROUP_CONFIG "/*"
+#define POLICY NODE_POLICY_CONFIG "/*"
+#define MESSAGES NODE_SYSLOG "/action/file/*/facility"
+#define MAIN_MESSAGES NODE_SYSLOG "/action/file/\\/var\\/log\\/messages/facility"
 
 static const std::vector<schema_row> rows = [] {
     constexpr int64_t NUMBER_MAX = 0xffffffff;
     std::vector<schema_row> made = {
-        {"/qv/tunneld/system/config/mode",
-         bn_type_str,
-         "router",
-         1,
-         15,
-         "router|server|bridge",
-         nullptr,
-         false,
-         {}},
-        {"/qv/tunneld/system/config/bonding", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {"/qv/tunneld/system/config/10g", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {"/qv/wccpd/system/config/mcast_ttl", bn_type_uint32, "1", 1, 255, nullptr, nullptr, false, {}},
+        {NODE_SYSTEM_MODE, bn_type_str, "router", 1, 15, "router|server|bridge", nullptr, false, {}},
+        {NODE_SYSTEM_BONDING, bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {NODE_SYSTEM_10G, bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
+        {NODE_MCAST_TTL, bn_type_uint32, "1", 1, 255, nullptr, nullptr, false, {}},
 
         {POLICY, bn_type_uint16, nullptr, 1, 65535, nullptr, nullptr, true, {}},
         {POLICY "/name", bn_type_str, "", 0, 63, nullptr, nullptr, false, {}},
@@ -95,16 +88,8 @@ static const std::vector<schema_row> rows = [] {
         {GROUP "/mask_dst_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr, false, {}},
         {GROUP "/compatibility", bn_type_str, "ios", 1, 15, "ios|nexus", nullptr, false, {}},
 
-        {"/logging/syslog/facility/system",
-         bn_type_uint32,
-         nullptr,
-         0,
-         184,
-         nullptr,
-         check_facility,
-         false,
-         {}},
-        {"/logging/syslog/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level, false, {}},
+        {NODE_SYSTEM_FACILITY, bn_type_uint32, nullptr, 0, 184, nullptr, check_facility, false, {}},
+        {NODE_SYSLOG "/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level, false, {}},
         {MESSAGES "/all/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level, false, {}},
         {MAIN_MESSAGES "/override/enable", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
         {MESSAGES "/override/enable", bn_type_bool, nullptr, 0, 0, nullptr, nullptr, false, {}},
@@ -119,36 +104,35 @@ const std::vector<schema_row> &schema() {
     return rows;
 }
 
-#define STATE "/qv/wccpd/wccp/srv_grp/state"
 const std::vector<const char *> &wccpd_state_nodes() {
     static const std::vector<const char *> nodes = {
-        "/qv/wccpd/system/state/proto_ver",
-        "/qv/wccpd/system/state/version",
-        "/qv/wccpd/system/state/is_alive",
-        "/qv/wccpd/system/state/debug_global",
-        "/qv/wccpd/system/state/debug_all",
-        STATE "/*",
-        STATE "/*/oper",
-        STATE "/*/uptime",
-        STATE "/*/app_id",
-        STATE "/*/num_routers",
-        STATE "/*/num_appliances",
-        STATE "/*/debug",
-        STATE "/*/assignment",
-        STATE "/*/router/*",
-        STATE "/*/router/*/state",
-        STATE "/*/router/*/fwd_method",
-        STATE "/*/router/*/ret_method",
-        STATE "/*/router/*/assign_method",
-        STATE "/*/router/*/id",
-        STATE "/*/router/*/ipaddr",
-        STATE "/*/router/*/conn_time",
-        STATE "/*/router/*/appliance/*",
-        STATE "/*/router/*/appliance/*/load_dist",
+        NODE_WCCPD_STATE "/proto_ver",
+        NODE_WCCPD_STATE "/version",
+        NODE_WCCPD_STATUS,
+        NODE_WCCPD_STATE "/debug_global",
+        NODE_WCCPD_STATE "/debug_all",
+        NODE_GROUP_STATE "/*",
+        NODE_GROUP_STATE "/*/oper",
+        NODE_GROUP_STATE "/*/uptime",
+        NODE_GROUP_STATE "/*/app_id",
+        NODE_GROUP_STATE "/*/num_routers",
+        NODE_GROUP_STATE "/*/num_appliances",
+        NODE_GROUP_STATE "/*/debug",
+        NODE_GROUP_STATE "/*/assignment",
+        NODE_GROUP_STATE "/*/router/*",
+        NODE_GROUP_STATE "/*/router/*/state",
+        NODE_GROUP_STATE "/*/router/*/fwd_method",
+        NODE_GROUP_STATE "/*/router/*/ret_method",
+        NODE_GROUP_STATE "/*/router/*/assign_method",
+        NODE_GROUP_STATE "/*/router/*/id",
+        NODE_GROUP_STATE "/*/router/*/ipaddr",
+        NODE_GROUP_STATE "/*/router/*/conn_time",
+        NODE_GROUP_STATE "/*/router/*/appliance/*",
+        NODE_GROUP_STATE "/*/router/*/appliance/*/load_dist",
         // Appliances are asked for by number; as a node of its own the number keeps a walk out of it.
-        STATE "/*/appliance/*",
-        STATE "/*/appliance/*/ipaddr",
-        STATE "/*/appliance/*/weight",
+        NODE_GROUP_STATE "/*/appliance/*",
+        NODE_GROUP_STATE "/*/appliance/*/ipaddr",
+        NODE_GROUP_STATE "/*/appliance/*/weight",
     };
     return nodes;
 }
@@ -335,7 +319,14 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
 // --- Reports
 
 const char *alarm_name(const std::string &type) {
-    return type == "196638" ? "adjacency" : type == "196639" ? "assignment" : "unknown";
+    static const struct {
+        int type;
+        const char *name;
+    } alarms[] = {{ALARM_TYPE_ADJACENCY, "adjacency"}, {ALARM_TYPE_ASSIGNMENT, "assignment"}};
+    for (const auto &alarm : alarms)
+        if (type == std::to_string(alarm.type))
+            return alarm.name;
+    return "unknown";
 }
 
 const char *role_name(const std::string &role) {

@@ -1,0 +1,48 @@
+// The names of nodes, events and actions that more than one program uses, and the numbers of the alarms. They
+// are macros so that a longer name is one literal: NODE_GROUP_CONFIG "/*/weight".
+#pragma once
+
+// --- Configuration nodes
+#define NODE_WCCPD "/qv/wccpd"
+#define NODE_WCCPD_CONFIG NODE_WCCPD "/system/config"
+#define NODE_MCAST_TTL NODE_WCCPD_CONFIG "/mcast_ttl"
+#define NODE_GROUP_CONFIG NODE_WCCPD "/wccp/srv_grp/config"     // service groups, by id
+#define NODE_POLICY_CONFIG NODE_WCCPD "/wccp/policy_grp/config" // policy groups, by number
+#define NODE_SYSTEM_CONFIG "/qv/tunneld/system/config"
+#define NODE_SYSTEM_MODE NODE_SYSTEM_CONFIG "/mode"
+#define NODE_SYSTEM_BONDING NODE_SYSTEM_CONFIG "/bonding"
+#define NODE_SYSTEM_10G NODE_SYSTEM_CONFIG "/10g"
+#define NODE_SYSLOG "/logging/syslog"
+#define NODE_SYSLOG_FACILITY NODE_SYSLOG "/facility"
+#define NODE_SYSTEM_FACILITY NODE_SYSLOG_FACILITY "/system"
+
+// --- State nodes, answered by wccpd
+#define NODE_WCCPD_STATE NODE_WCCPD "/system/state"
+#define NODE_WCCPD_STATUS NODE_WCCPD_STATE "/is_alive"
+#define NODE_GROUP_STATE NODE_WCCPD "/wccp/srv_grp/state"
+
+// --- State nodes, kept by mgmtd
+#define NODE_ALARM_STATE "/qv/alarms/state"
+#define NODE_ALARMS_RAISED NODE_ALARM_STATE "/raised" // by type and source
+#define NODE_ROLES NODE_ALARM_STATE "/role"           // by group
+
+// --- Events
+#define EVENT_CONFIG_CHANGE "/mgmtd/notify/dbchange" // after each commit
+#define EVENT_RAISE_ALARM "/qv/alarms/events/raise_alarm"
+#define EVENT_CLEAR_ALARM "/qv/alarms/events/clear_alarm"
+#define EVENT_ROLE_CHANGE "/qv/state/events/role_change"
+#define EVENT_PROCESS_CRASH "/pm/events/failure/crash"
+#define EVENT_PROCESS_EXIT "/pm/events/failure/unexpected_exit"
+#define EVENT_PROCESS_TERMINATE "/pm/events/proc/terminate"
+#define EVENT_TIME_ZONE "/time/notify/zonechange"
+
+// The changes of a commit in its event: EVENT_CHANGES "/1", "/2" and so on, each with bindings of its own.
+#define EVENT_CHANGES "/mgmtd/notification/dbchange"
+
+// --- Actions that mgmtd carries out
+#define ACTION_ADD_INTEREST "/mgmtd/events/actions/interest/add"
+#define ACTION_REMOVE_INTEREST "/mgmtd/events/actions/interest/remove"
+
+// --- Alarm types
+#define ALARM_TYPE_ADJACENCY 196638  // no router reports this appliance
+#define ALARM_TYPE_ASSIGNMENT 196639 // a router's table is not the designated appliance's
