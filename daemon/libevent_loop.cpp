@@ -31,13 +31,13 @@
 // writable, in the place of vanishing without a sign.
 #include "daemon/libevent_loop.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <ctime>
 
 #include <event2/event.h>
 #include <event2/event_struct.h>
@@ -48,6 +48,7 @@
 #include "daemon/libevent_wrapper.h"
 #include "runtime/guards.h"
 #include "runtime/logging.h"
+#include "runtime/ttime.h"
 
 static_assert(LOOP_TIMEOUT == EV_TIMEOUT && LOOP_READ == EV_READ && LOOP_WRITE == EV_WRITE &&
               LOOP_SIGNAL == EV_SIGNAL);
@@ -237,13 +238,10 @@ lc_status loop_event_set_timer(loop_event *event, int64_t delay_ms) {
     event->number = -1;
     if (event_assign(&event->base_event, event->context->base, -1, 0, found, event) != 0)
         FAIL_WITH(LC_GENERIC);
-    timespec now{};
-    clock_gettime(CLOCK_MONOTONIC, &now);
     timeval delay;
     delay.tv_sec = delay_ms / 1000;
     delay.tv_usec = delay_ms % 1000 * 1000;
-    if (delay.tv_sec > TIME_MAX_SECONDS - now.tv_sec - 1)
-        delay.tv_sec = TIME_MAX_SECONDS - now.tv_sec - 1;
+    delay.tv_sec = std::min(delay.tv_sec, TIME_MAX_SECONDS - lt_monotonic_ms() / 1000 - 1);
     CHECK_STATUS(insert(event, &delay));
     return LC_OK;
 }

@@ -32,6 +32,7 @@
 #include <unistd.h>
 
 #include "runtime/common.h"
+#include "runtime/ttime.h"
 
 constexpr const char *LOG_PATH = "/dev/log";
 constexpr size_t LINE_BYTES = 4096;
@@ -97,12 +98,6 @@ void syslog_socket_open(syslog_socket *log, const char *ident, bool with_pid, in
     (void)connect_to_daemon(log);
 }
 
-static int64_t now_ns() {
-    timespec now;
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return now.tv_sec * SECOND_NS + now.tv_nsec;
-}
-
 // Waits a step for room, on account of the patience. False when there is none left. A step counts for no more
 // than its own length: when the machine is so busy that this thread runs late, so does the daemon.
 static bool wait_for_room(syslog_socket *log) {
@@ -110,9 +105,9 @@ static bool wait_for_room(syslog_socket *log) {
         return false;
     const timespec step = {0, WAIT_STEP_NS};
     pollfd writable = {log->fd, POLLOUT, 0};
-    const int64_t began = now_ns();
+    const int64_t began = lt_monotonic_ns();
     (void)ppoll(&writable, log->fd >= 0, &step, nullptr);
-    const int64_t waited = now_ns() - began;
+    const int64_t waited = lt_monotonic_ns() - began;
     log->patience_ns -= std::clamp<int64_t>(waited, LEAST_STEP_NS, WAIT_STEP_NS);
     return true;
 }

@@ -8,10 +8,12 @@
 
 constexpr int64_t US_PER_SEC = 1000000;
 constexpr int64_t US_PER_MS = 1000;
+constexpr int64_t NS_PER_SEC = 1000000000;
+constexpr int64_t NS_PER_MS = 1000000;
 constexpr int64_t SEC_LIMIT_US = 0x7a12000000000;
 constexpr uint32_t TEXT_SIZE = 36;
 
-// ---- Clock and records
+// ---- Clocks and records
 
 lt_time_us lt_curr_time_us() {
     timeval now{};
@@ -23,6 +25,15 @@ lt_time_ms lt_curr_time_ms() {
 }
 lt_time_sec lt_curr_time() {
     return static_cast<lt_time_sec>(lt_curr_time_us() / US_PER_SEC);
+}
+
+int64_t lt_monotonic_ns() {
+    timespec now{};
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return int64_t{now.tv_sec} * NS_PER_SEC + now.tv_nsec;
+}
+int64_t lt_monotonic_ms() {
+    return lt_monotonic_ns() / NS_PER_MS;
 }
 
 lc_status lt_time_sec_to_tm(lt_time_sec seconds, tm *out) {

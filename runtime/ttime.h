@@ -22,6 +22,11 @@ lt_time_sec lt_curr_time();
 lt_time_ms lt_curr_time_ms();
 lt_time_us lt_curr_time_us();
 
+// The clock that nobody sets (CLOCK_MONOTONIC), for time-outs and durations. It stands still while the
+// machine is suspended.
+int64_t lt_monotonic_ms();
+int64_t lt_monotonic_ns();
+
 lc_status lt_time_sec_to_tm(lt_time_sec seconds, tm *out); // local
 lc_status lt_time_sec_to_tm_utc(lt_time_sec seconds, tm *out);
 lt_time_us lt_tm_to_time_us(const tm *local); // null is logged and gives 0

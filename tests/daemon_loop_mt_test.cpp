@@ -1,6 +1,5 @@
 // The loop under other threads: escapes and posted work wake a wait, at its outer and at its inner depth.
 #include <atomic>
-#include <ctime>
 #include <functional>
 #include <thread>
 
@@ -8,14 +7,9 @@
 #include <unistd.h>
 
 #include "daemon/libevent_wrapper.h"
+#include "runtime/ttime.h"
 
 namespace {
-
-double now_seconds() {
-    timespec now{};
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
-}
 
 struct loop_thread {
     lew *wrapper = nullptr;
@@ -65,10 +59,10 @@ TEST(LoopThreads, AnEscapeFromOutsideEndsTheWaitAtEachDepth) {
             };
         it.start();
         usleep(50000);
-        const double start = now_seconds();
+        const int64_t start = lt_monotonic_ms();
         EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
         it.finish();
-        EXPECT_LT(now_seconds() - start, 2);
+        EXPECT_LT(lt_monotonic_ms() - start, 2000);
         EXPECT_EQ(it.escaped, 1);
         EXPECT_EQ(inner, nested ? 1 : -1);
     }
@@ -114,7 +108,8 @@ TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
         });
     for (std::thread &thread : threads)
         thread.join();
-    for (const double start = now_seconds(); all.carried < posters * each && now_seconds() - start < 4;)
+    for (const int64_t start = lt_monotonic_ms();
+         all.carried < posters * each && lt_monotonic_ms() - start < 4000;)
         usleep(1000);
     EXPECT_EQ(all.carried, posters * each);
     EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
@@ -145,10 +140,10 @@ TEST(LoopThreads, PostedWorkEndsANestedWait) {
     while (!waiting)
         usleep(1000);
     usleep(20000);
-    const double start = now_seconds();
+    const int64_t start = lt_monotonic_ms();
     counted_post::send(&all, it.loop, 0, &expected);
     it.finish();
-    EXPECT_LT(now_seconds() - start, 2);
+    EXPECT_LT(lt_monotonic_ms() - start, 2000);
 }
 
 } // namespace

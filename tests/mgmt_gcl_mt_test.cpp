@@ -2,7 +2,6 @@
 // are sent. WCCP_STRESS=1 makes it the long form: a minute of sending, a thousand closings.
 #include <atomic>
 #include <cstdlib>
-#include <ctime>
 #include <map>
 #include <random>
 #include <thread>
@@ -12,6 +11,7 @@
 #include <pthread.h>
 #include <sys/ioctl.h>
 
+#include "runtime/ttime.h"
 #include "tests/support/gcl_client.h"
 
 // A cancelled thread ends with its stack still marked; the sanitizer then trips over its own last write
@@ -27,12 +27,6 @@ bool stress() {
     const char *value = getenv("WCCP_STRESS");
     return value && *value && *value != '0';
 }
-double now_seconds() {
-    timespec now{};
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
-}
-
 // The alarm client: a thread that makes the session, opens it and runs its loop.
 struct session_thread {
     gcl_client client;
@@ -139,10 +133,10 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
 
     uint32_t expected[4] = {}, frames = 0, acknowledged = 0, sequence = 2000003;
     std::minstd_rand random(1);
-    const double end = now_seconds() + (stress() ? 60 : 3);
+    const int64_t end = lt_monotonic_ms() + (stress() ? 60000 : 3000);
     bool draining = false;
     for (;;) {
-        if (!draining && now_seconds() > end) {
+        if (!draining && lt_monotonic_ms() > end) {
             over = true;
             canceller.join();
             for (sender &each : senders)
@@ -175,8 +169,8 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
     for (uint16_t i = 1; i <= 3; i++)
         EXPECT_EQ(senders[i - 1].next, expected[i]);
     EXPECT_GT(frames, 100u);
-    for (const double start = now_seconds();
-         session.acknowledged < static_cast<int>(acknowledged) && now_seconds() - start < 5;)
+    for (const int64_t start = lt_monotonic_ms();
+         session.acknowledged < static_cast<int>(acknowledged) && lt_monotonic_ms() - start < 5000;)
         usleep(1000);
     EXPECT_EQ(session.acknowledged, static_cast<int>(acknowledged));
     EXPECT_FALSE(session.ended);
@@ -204,7 +198,7 @@ TEST(GclThreads, AProviderThatClosesWhileOthersSend) {
             provider.take_frame();
         usleep(static_cast<useconds_t>(random() % 4000));
         provider.close_client();
-        for (const double start = now_seconds(); !session.ended && now_seconds() - start < 10;)
+        for (const int64_t start = lt_monotonic_ms(); !session.ended && lt_monotonic_ms() - start < 10000;)
             usleep(500);
         ASSERT_TRUE(session.ended);
         const std::thread::id own = session.thread.get_id();

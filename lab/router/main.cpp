@@ -14,7 +14,6 @@
 #include <csignal>
 #include <cstdio>
 #include <cstring>
-#include <ctime>
 #include <iterator>
 #include <sstream>
 
@@ -22,6 +21,7 @@
 
 #include "lab/router/router.h"
 #include "lab/router/tools.h"
+#include "runtime/ttime.h"
 #include "runtime/version.h"
 
 using namespace lab;
@@ -41,9 +41,7 @@ struct lab_process {
 };
 
 static double seconds_now() {
-    timespec now;
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+    return static_cast<double>(lt_monotonic_ns()) / 1e9;
 }
 
 static sockaddr_in place_of(address where) {

@@ -32,6 +32,7 @@
 #include "peers/nodes/provider_path.h"
 #include "runtime/fdintrcb.h"
 #include "runtime/logging.h"
+#include "runtime/ttime.h"
 
 static constexpr int32_t SERVICE = 2;
 
@@ -60,12 +61,6 @@ static bool fail(std::string *out_reason, const std::string &reason) {
     if (out_reason)
         *out_reason = reason;
     return false;
-}
-
-static int64_t now_ms() {
-    timespec now;
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1000000;
 }
 
 // --- Rounds
@@ -121,7 +116,7 @@ static round run_round(ctl_session *self, int64_t deadline) {
         polled[i].events =
             static_cast<short>((event->want_read ? POLLIN : 0) | (event->want_write ? POLLOUT : 0));
     }
-    const int64_t left = deadline < 0 ? 0 : std::max<int64_t>(deadline - now_ms(), 0);
+    const int64_t left = deadline < 0 ? 0 : std::max<int64_t>(deadline - lt_monotonic_ms(), 0);
     const timespec limit = {static_cast<time_t>(left / 1000), static_cast<long>(left % 1000 * 1000000)};
     const int ready = ppoll(polled.data(), polled.size(), deadline < 0 ? nullptr : &limit, &blocked.before);
     if (ready < 0)
@@ -135,7 +130,7 @@ static round run_round(ctl_session *self, int64_t deadline) {
 // Until `done`, in the time that requests have.
 template <typename Done>
 static bool wait_for(ctl_session *self, const char *what, Done done, std::string *out_reason) {
-    const int64_t deadline = now_ms() + self->timeout_ms;
+    const int64_t deadline = lt_monotonic_ms() + self->timeout_ms;
     while (!done()) {
         if (!is_connected(self))
             return fail(out_reason, std::string("mgmtd closed the session ") + what);
@@ -337,7 +332,7 @@ bool ctl_add_interest(ctl_session *session, const std::string &event,
 }
 
 int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason) {
-    const int64_t deadline = wait_ms < 0 ? -1 : now_ms() + wait_ms;
+    const int64_t deadline = wait_ms < 0 ? -1 : lt_monotonic_ms() + wait_ms;
     while (session->events.empty()) {
         if (!is_connected(session)) {
             fail(out_reason, "mgmtd closed the session");

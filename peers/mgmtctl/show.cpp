@@ -23,6 +23,7 @@
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/commands.h"
 #include "peers/mgmtctl/show_picture.h"
+#include "runtime/ttime.h"
 
 static constexpr int64_t PERIOD_MS = 1000;
 static constexpr int64_t BURST_MS = 100; // events within it are one
@@ -154,12 +155,6 @@ static picture look(const viewer &self, ctl_session *session) {
 
 // --- Staying live
 
-static int64_t now_ms() {
-    timespec now;
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1000000;
-}
-
 static void take_signal(int number) {
     if (number == SIGTSTP)
         pause_wanted = 1;
@@ -208,11 +203,12 @@ static bool add_interests(ctl_session *session, std::string *out_reason) {
 
 // Until it is time for the next picture, after one that cost so long. False: the session has ended.
 static bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reason) {
-    const int64_t began = now_ms();
+    const int64_t began = lt_monotonic_ms();
     int64_t until = began + std::max(PERIOD_MS, 4 * cost_ms);
     while (!ctl_stop_signal && !pause_wanted) {
         ctl_event event;
-        const int came = ctl_next_event(session, std::max<int64_t>(until - now_ms(), 0), &event, out_reason);
+        const int came =
+            ctl_next_event(session, std::max<int64_t>(until - lt_monotonic_ms(), 0), &event, out_reason);
         if (came < 0)
             return false;
         if (came == 0)
@@ -236,10 +232,10 @@ static int watch(viewer *self) {
                 session = nullptr;
             }
         }
-        const int64_t began = now_ms();
+        const int64_t began = lt_monotonic_ms();
         if (session)
             shown = look(*self, session);
-        const int64_t cost_ms = now_ms() - began;
+        const int64_t cost_ms = lt_monotonic_ms() - began;
         if (ctl_stop_signal)
             break;
         if (self->terminal && !self->options.json)

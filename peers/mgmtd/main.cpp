@@ -4,7 +4,6 @@
 #include <csignal>
 #include <cstdio>
 #include <cstring>
-#include <ctime>
 
 #include <poll.h>
 #include <sys/signalfd.h>
@@ -16,15 +15,10 @@
 #include "peers/mgmtd/transport.h"
 #include "runtime/common.h"
 #include "runtime/logging.h"
+#include "runtime/ttime.h"
 #include "runtime/version.h"
 
 static constexpr uint32_t COMPONENT_MGMTD = 5u << 16;
-
-static int64_t monotonic_ms() {
-    timespec now;
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
-}
 
 // Nobody has to read what is said: a pipe that is full, or a terminal that is held, loses lines and stops
 // nothing. Up to PIPE_BUF bytes fit whole wherever POLLOUT is told.
@@ -97,7 +91,7 @@ int main(int argc, char **argv) {
     if (check)
         return 0;
     daemon.config_file = config;
-    daemon.now_ms = monotonic_ms;
+    daemon.now_ms = lt_monotonic_ms;
     daemon.say = say;
 
     const int signals = block_signals();
@@ -110,7 +104,7 @@ int main(int argc, char **argv) {
     say("mgmtd ready, " + std::to_string(daemon.tree.nodes.size()) + " nodes");
 
     supervisor processes;
-    processes.now_ms = monotonic_ms;
+    processes.now_ms = lt_monotonic_ms;
     processes.say = say;
     processes.tell = [&](const std::string &event, const std::string &process) {
         server_process_event(&daemon, event, process);
@@ -124,7 +118,7 @@ int main(int argc, char **argv) {
         if (processes.ending && supervisor_is_done(processes))
             break;
         const int64_t query_due = server_tick(&daemon);
-        if (transport_round(&sockets, signals, time_left(monotonic_ms(), {child_due, query_due})))
+        if (transport_round(&sockets, signals, time_left(lt_monotonic_ms(), {child_due, query_due})))
             take_signals(signals, &daemon, &processes);
     }
     transport_close(&sockets);

@@ -22,17 +22,12 @@
 
 #include "platform/tunnel_mailbox.h"
 #include "runtime/cmem.h"
+#include "runtime/ttime.h"
 
 namespace {
 
 constexpr int64_t BUSY_MS = 1, QUIET_MS = 5, DETACHED_MS = 250;
 constexpr int64_t BUSY_FOR_MS = 1000, ROLES_EVERY_MS = 1000;
-
-int64_t now_ms() {
-    timespec now;
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return now.tv_sec * 1000 + now.tv_nsec / 1000000;
-}
 
 sigset_t end_signals() {
     sigset_t set;
@@ -243,7 +238,7 @@ bool tunneld_step(tunneld *daemon) {
 void tunneld_run(tunneld *daemon) {
     int64_t busy_until = 0, roles_at = 0;
     for (bool end = false; !end;) {
-        const int64_t now = now_ms();
+        const int64_t now = lt_monotonic_ms();
         if (step(daemon, &end)) {
             busy_until = now + BUSY_FOR_MS;
             continue;
