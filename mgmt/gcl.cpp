@@ -38,11 +38,15 @@ const lc_enum_entry gcl_session_state_table[] = {
     {0, nullptr},
 };
 
+namespace {
+
 struct gcl_instance_guard {
     explicit gcl_instance_guard(gcl *instance) : instance_lock(instance->lock) {}
     cancel_off_guard cancel_off;
     lc_lock_guard instance_lock;
 };
+
+} // namespace
 
 gcl_session_guard::gcl_session_guard(gcl_session *session)
     : instance_lock(session->instance->lock), session_lock(session->lock) {}

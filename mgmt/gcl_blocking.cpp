@@ -21,12 +21,14 @@
 constexpr int FD_MAX = 0x1ffff;
 constexpr int64_t END_LOOK_MS = 200;
 
+namespace {
+
 // What a caller can wait for a change of.
-struct gcl_watched {
+struct watched_state {
     uint64_t frames_sent, frames_received;
     int32_t session_state, protocol_state;
 };
-struct gcl_wait {
+struct blocking_wait {
     gcl *instance;
     gcl_session *session;
     bool on_sent, on_received, on_session_state, on_protocol_state;
@@ -35,21 +37,23 @@ struct gcl_wait {
     uint32_t timers_told;           // timers up to this id have had their call
 };
 
+} // namespace
+
 static void free_polled(pollfd *polled) {
     free(polled);
 }
 
-static gcl_watched look(const gcl_wait *wait) {
-    gcl_watched seen{wait->session->counters.frames_sent, wait->session->counters.frames_received,
-                     wait->session->state, 0};
+static watched_state look(const blocking_wait *wait) {
+    watched_state seen{wait->session->counters.frames_sent, wait->session->counters.frames_received,
+                       wait->session->state, 0};
     gcl_body_protocol *protocol = gcl_get_body_protocol(wait->instance, wait->protocol);
     if (protocol && protocol->query_session_state && wait->session->protocol_state[wait->protocol])
         LOG_STATUS(protocol->query_session_state(wait->session, protocol, &seen.protocol_state));
     return seen;
 }
 
-static bool changed(const gcl_wait *wait, const gcl_watched *before) {
-    const gcl_watched now = look(wait);
+static bool changed(const blocking_wait *wait, const watched_state *before) {
+    const watched_state now = look(wait);
     const bool differs = (wait->on_sent && now.frames_sent != before->frames_sent) ||
                          (wait->on_received && now.frames_received != before->frames_received) ||
                          (wait->on_session_state && now.session_state != before->session_state) ||
@@ -72,7 +76,7 @@ bool gcl_end_is_pending(const gcl *instance) {
 }
 
 // Milliseconds left, -1 for no limit, -2 when time is up.
-static int64_t time_left(gcl_wait *wait) {
+static int64_t time_left(blocking_wait *wait) {
     if (wait->timeout_ms < 0)
         return -1;
     const int64_t now = lt_curr_time_ms();
@@ -83,7 +87,7 @@ static int64_t time_left(gcl_wait *wait) {
 }
 
 // Calls the timers that are due, each once in a wait, and gives the time to the next one (-1: none).
-static lc_status run_timers(gcl_wait *wait, const fdic_event_array *events, int64_t *out_next) {
+static lc_status run_timers(blocking_wait *wait, const fdic_event_array *events, int64_t *out_next) {
     const int64_t passed = lt_curr_time_ms() - wait->started_ms;
     *out_next = -1;
     for (uint32_t i = 0; i < fdic_event_array_length_quick(events); i++) {
@@ -121,8 +125,8 @@ static lc_status fill_polled(const fdic_event_array *events, pollfd *polled) {
 }
 
 // Calls what is ready; `out_stop` when what the caller waits for has changed.
-static lc_status run_ready(const gcl_wait *wait, const fdic_event_array *events, const pollfd *polled,
-                           const gcl_watched *before, bool *out_stop) {
+static lc_status run_ready(const blocking_wait *wait, const fdic_event_array *events, const pollfd *polled,
+                           const watched_state *before, bool *out_stop) {
     constexpr short broken = POLLERR | POLLHUP | POLLNVAL;
     for (uint32_t i = 0; i < fdic_event_array_length_quick(events) && !*out_stop; i++) {
         const fdic_event *event = fdic_event_array_get_quick(events, i);
@@ -144,14 +148,14 @@ static lc_status run_ready(const gcl_wait *wait, const fdic_event_array *events,
     return LC_OK;
 }
 
-static lc_status wait_round(gcl_wait *wait, bool *out_stop) {
+static lc_status wait_round(blocking_wait *wait, bool *out_stop) {
     if (wait->session->state == GCL_SESSION_CLOSED || wait->session->fd < 0)
         return LC_IO_CLOSED;
     if (gcl_end_is_pending(wait->instance))
         return LC_CANCELLED;
     owned<fdic_event_array, fdic_event_array_release> events;
     CHECK_STATUS(fdic_events_query(wait->instance->interests, &events.pointer));
-    const gcl_watched before = look(wait);
+    const watched_state before = look(wait);
     int64_t next_timer = -1;
     CHECK_STATUS(run_timers(wait, events.pointer, &next_timer));
     const uint32_t count = fdic_event_array_length_quick(events.pointer);
@@ -184,16 +188,16 @@ lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int st
     CHECK_NULL(instance);
     CHECK_NULL(session);
     const gcl_session_guard guard(session);
-    gcl_wait wait = {instance,
-                     session,
-                     stop_on_frames_sent != 0,
-                     stop_on_frames_received != 0,
-                     stop_on_session_state != 0,
-                     stop_on_protocol_state != 0,
-                     protocol,
-                     timeout_ms,
-                     lt_curr_time_ms(),
-                     0};
+    blocking_wait wait = {instance,
+                          session,
+                          stop_on_frames_sent != 0,
+                          stop_on_frames_received != 0,
+                          stop_on_session_state != 0,
+                          stop_on_protocol_state != 0,
+                          protocol,
+                          timeout_ms,
+                          lt_curr_time_ms(),
+                          0};
     bool stop = false;
     while (!stop)
         CHECK_QUIET(wait_round(&wait, &stop));

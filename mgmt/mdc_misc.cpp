@@ -17,7 +17,6 @@ constexpr const char *WILDCARD = "*";
 constexpr uint32_t REGISTERED_PARTS_MAX = 64;
 
 // --- Registered nodes
-// -----------------------------------------------------------------------------------------------
 
 struct mdc_remote_reg {
     tstring *name;
@@ -85,7 +84,8 @@ uint32_t mdc_remote_reg_get_cap_mask(const mdc_remote_reg *record) {
 }
 
 // --- The walk
-// -------------------------------------------------------------------------------------------------------
+
+namespace {
 
 struct mon_walk {
     tree *registered;
@@ -96,6 +96,8 @@ struct mon_walk {
     void *iterate_data;
     bn_binding_array *found;
 };
+
+} // namespace
 
 static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth);
 
@@ -110,11 +112,16 @@ static lc_status walk_child(const mon_walk *walk, tstr_array *parts, const char 
     return LC_OK;
 }
 
+namespace {
+
 struct child_walk {
     const mon_walk *walk;
     tstr_array *parts;
     uint32_t depth;
 };
+
+} // namespace
+
 static lc_status walk_tree_child(tree *, tree_node *, const char *name, void *value, void *data) {
     (void)value;
     const child_walk *child = static_cast<const child_walk *>(data);
@@ -172,7 +179,6 @@ static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array 
 }
 
 // --- The query
-// ------------------------------------------------------------------------------------------------------
 
 static lc_status add_registration(tree *registered, const bn_binding *binding) {
     const bn_attrib *attribute = nullptr;
@@ -270,10 +276,11 @@ lc_status mdc_dispatch_mon_request(gcl_session *session, bn_request_msg *request
 }
 
 // --- The change event
-// -----------------------------------------------------------------------------------------------
 
 constexpr const char *CHANGE_PATTERN = EVENT_CHANGES "/*";
 constexpr uint32_t CHANGE_PARTS = 4;
+
+namespace {
 
 struct change_entry {
     const char *name; // of the changed node
@@ -282,6 +289,8 @@ struct change_entry {
     bn_binding_array *old_values; // null when nobody asked for them
     bn_binding_array *new_values;
 };
+
+} // namespace
 
 static lc_status add_renamed(bn_binding_array *out, const bn_binding *value, const char *name) {
     if (!out)

@@ -290,6 +290,8 @@ lc_status snmprintf(char **out_string, uint32_t *out_length, const char *format,
 
 // --- Environment
 
+namespace {
+
 // lc_env_lock when it exists; before lc_init there is only one thread. The log takes it under its own lock
 // when the time zone changes, so nothing is logged while it is held.
 struct env_guard {
@@ -305,6 +307,8 @@ struct env_guard {
     env_guard &operator=(const env_guard &) = delete;
     lc_lock *held;
 };
+
+} // namespace
 
 lc_status lc_getenv_ts(const char *name, char **out_text) {
     CHECK_NULL(out_text);

@@ -20,12 +20,6 @@
 #include "runtime/hash_table.h"
 #include "runtime/logging.h"
 
-struct fdic_libevent_entry {
-    loop_context *loop;
-    loop_event *event;
-    fdic_event interest;
-};
-
 struct fdic_libevent {
     loop_context *loop;
     ht *entries; // by interest id
@@ -35,11 +29,21 @@ struct fdic_libevent {
     void *open_data;
 };
 
+namespace {
+
+struct fdic_libevent_entry {
+    loop_context *loop;
+    loop_event *event;
+    fdic_event interest;
+};
+
 struct posted_changes {
     loop_post post; // first, so that the record can be found again
     fdic_libevent *bridge;
     fdic_event_array *changes;
 };
+
+} // namespace
 
 static lc_status fdic_libevent_record_free(void *key, uint32_t, void *value, void *) {
     auto *entry = static_cast<fdic_libevent_entry *>(value);

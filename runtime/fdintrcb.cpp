@@ -173,18 +173,20 @@ lc_status fdic_event_add_timer(fdic *context, int64_t delay_ms, void *user_data,
     return LC_OK;
 }
 
-static fdic_event *find_current(const fdic *context, int32_t id) {
+// The current record of an id; `what` says in the log what an unknown one was asked for.
+static lc_status find_current(const fdic *context, int32_t id, const char *what, fdic_event **out) {
     uint32_t index = 0;
-    return id > 0 ? find(context->current, static_cast<uint32_t>(id), &index) : nullptr;
+    CHECK_NULL(context);
+    *out = id > 0 ? find(context->current, static_cast<uint32_t>(id), &index) : nullptr;
+    if (*out)
+        return LC_OK;
+    LC_LOG(LC_LOG_WARNING, "Asked to %s with bad id %d", what, id);
+    return LC_NOT_FOUND;
 }
 
 lc_status fdic_event_update_fd(fdic *context, int32_t id, int32_t want_read, int32_t want_write) {
-    CHECK_NULL(context);
-    fdic_event *event = find_current(context, id);
-    if (!event) {
-        LC_LOG(LC_LOG_WARNING, "Asked to update event fd with bad id %d", id);
-        return LC_NOT_FOUND;
-    }
+    fdic_event *event = nullptr;
+    CHECK_QUIET(find_current(context, id, "update event fd", &event));
     event->want_read = want_read;
     event->want_write = want_write;
     CHECK_STATUS(tell_changes(context));
@@ -192,36 +194,24 @@ lc_status fdic_event_update_fd(fdic *context, int32_t id, int32_t want_read, int
 }
 
 lc_status fdic_event_delete_fd(fdic *context, int32_t id) {
-    CHECK_NULL(context);
-    fdic_event *event = find_current(context, id);
-    if (!event) {
-        LC_LOG(LC_LOG_WARNING, "Asked to update event fd with bad id %d", id);
-        return LC_NOT_FOUND;
-    }
+    fdic_event *event = nullptr;
+    CHECK_QUIET(find_current(context, id, "update event fd", &event));
     event->active = 0;
     CHECK_STATUS(tell_changes(context));
     return LC_OK;
 }
 
 lc_status fdic_event_update_timer(fdic *context, int32_t id, int64_t delay_ms) {
-    CHECK_NULL(context);
-    fdic_event *event = find_current(context, id);
-    if (!event) {
-        LC_LOG(LC_LOG_WARNING, "Asked to update event timer with bad id %d", id);
-        return LC_NOT_FOUND;
-    }
+    fdic_event *event = nullptr;
+    CHECK_QUIET(find_current(context, id, "update event timer", &event));
     event->delay = delay_ms < 0 ? -1 : delay_ms;
     CHECK_STATUS(tell_changes(context));
     return LC_OK;
 }
 
 lc_status fdic_event_delete_timer(fdic *context, int32_t id) {
-    CHECK_NULL(context);
-    fdic_event *event = find_current(context, id);
-    if (!event) {
-        LC_LOG(LC_LOG_WARNING, "Asked to delete event timer with bad id %d", id);
-        return LC_NOT_FOUND;
-    }
+    fdic_event *event = nullptr;
+    CHECK_QUIET(find_current(context, id, "delete event timer", &event));
     LC_LOG(LC_LOG_INFO, "EVENT: deleting for %p: %ld ms", event->user_data, static_cast<long>(event->delay));
     event->active = 0;
     CHECK_STATUS(tell_changes(context));

@@ -11,6 +11,8 @@
 
 // ---- Hash: Jenkins' lookup2 over the key's bytes
 
+namespace {
+
 struct jenkins_state {
     uint32_t a, b, c;
 
@@ -26,6 +28,8 @@ struct jenkins_state {
         c = (c - a - b) ^ (b >> 15);
     }
 };
+
+} // namespace
 
 static uint32_t little_endian(const uint8_t *bytes, uint32_t count) {
     uint32_t value = 0;

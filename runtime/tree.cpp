@@ -167,11 +167,16 @@ lc_status tree_node_get_num_children(const tree *whole, const tree_node *node, u
     return array_length(node->children, out_count);
 }
 
+namespace {
+
 struct tree_walk {
     tree *whole;
     tree_foreach_function function;
     void *data;
 };
+
+} // namespace
+
 static lc_status visit(array *, uint32_t, void *element, void *data) {
     const auto *walk = static_cast<const tree_walk *>(data);
     auto *child = static_cast<tree_node *>(element);

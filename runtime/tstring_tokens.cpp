@@ -7,6 +7,8 @@
 #include "runtime/tstr_array.h"
 #include "runtime/tstring.h"
 
+namespace {
+
 struct token_syntax {
     char separator;
     char escape;
@@ -16,6 +18,8 @@ struct token_syntax {
 
     bool escapable(char next) const { return next && (next == separator || next == escape || next == quote); }
 };
+
+} // namespace
 
 static bool is_bad(const token_syntax &syntax) {
     return !syntax.separator || syntax.separator == syntax.escape || syntax.separator == syntax.quote ||
