@@ -58,7 +58,11 @@ constexpr time_t WAIT_MAX_SECONDS = 5;
 constexpr uint32_t FDS_MAX = 100000;
 constexpr int64_t TIME_MAX_SECONDS = 0x7ffffffe;
 
+namespace {
+
 enum class event_kind : uint8_t { unset, descriptor, timer, signal };
+
+} // namespace
 
 struct loop_event {
     loop_context *context;
@@ -75,12 +79,16 @@ struct loop_event {
     loop_event *next_signal;
 };
 
+namespace {
+
 struct loop_lock {
     pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
     pthread_cond_t freed = PTHREAD_COND_INITIALIZER;
     pthread_t holder{};
     uint32_t count = 0;
 };
+
+} // namespace
 
 struct loop_context {
     event_base *base;
@@ -248,13 +256,9 @@ lc_status loop_event_set_timer(loop_event *event, int64_t delay_ms) {
 
 // ---- Signals
 
-static std::atomic<loop_context *> le_signal_contexts[LEW_SIGNAL_MAX + 1];
+std::atomic<loop_context *> le_signal_contexts[LEW_SIGNAL_MAX + 1];
 static struct sigaction earlier_actions[LEW_SIGNAL_MAX + 1];
 static pthread_mutex_t signal_table_mutex = PTHREAD_MUTEX_INITIALIZER;
-
-loop_context *le_signal_context(int signal_number) {
-    return le_signal_contexts[signal_number].load();
-}
 
 static void handle_signal(int number, siginfo_t *, void *) {
     const int saved = errno;

@@ -2,8 +2,10 @@
 // runtime/loop_host.h, so that rooms below the daemon can use them.
 #pragma once
 
+#include <atomic>
+
 #include "runtime/loop_host.h"
 
 constexpr int LEW_SIGNAL_MAX = 65;
 // The context that owns each signal, by number; null for none.
-loop_context *le_signal_context(int signal_number);
+extern std::atomic<loop_context *> le_signal_contexts[LEW_SIGNAL_MAX + 1];

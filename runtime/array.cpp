@@ -231,9 +231,6 @@ lc_status array_insert_takeover(array *list, uint32_t index, void **inout_elemen
     note_order(list, index);
     return LC_OK;
 }
-lc_status array_insert(array *list, uint32_t index, const void *element) {
-    return with_copy(list, element, [&](void **copy) { return array_insert_takeover(list, index, copy); });
-}
 
 // What the policy says of a new element that equals the one at `index`.
 static lc_status meet_equal(array *list, uint32_t index, void **inout_element, bool *out_done) {

@@ -82,7 +82,6 @@ lc_status array_append(array *list, const void *element);
 lc_status array_append_takeover(array *list, void **inout_element);
 lc_status array_append_no_dup(array *list, const void *element);
 lc_status array_append_no_dup_takeover(array *list, void **inout_element);
-lc_status array_insert(array *list, uint32_t index, const void *element);
 lc_status array_insert_takeover(array *list, uint32_t index, void **inout_element);
 lc_status array_insert_sorted(array *list, const void *element);
 lc_status array_insert_sorted_takeover(array *list, void **inout_element);

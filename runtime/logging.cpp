@@ -17,7 +17,6 @@
 
 #include <pthread.h>
 
-#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -32,6 +31,8 @@
 #include "runtime/ttime.h"
 
 constexpr uint32_t FORMAT_CHARACTERS = 1023;
+constexpr const char *DEBUG_LOG = "/var/log/debug_log";
+constexpr off_t DEBUG_LOG_MAX_BYTES = 2000000;
 #define WCCP_STRING(text) #text
 #define WCCP_TEXT(number) WCCP_STRING(number)
 constexpr const char *WCCP_BUILD = WCCP_TEXT(WCCP_BUILD_NUMBER);
@@ -139,13 +140,16 @@ static lc_status close_locked() {
         return LC_NULL;
     G_log_state = nullptr;
     syslog_socket_close(&state->log_daemon);
-    free(state->threads);
     free(state);
     return LC_OK;
 }
 
 lc_status lc_log_close() {
     return G_log_state_lock ? close_locked() : LC_NULL;
+}
+
+const char *lc_log_get_lls_process_name() {
+    return G_log_state ? G_log_state->process_name : "";
 }
 
 // The first line of a process that never set logging up.
@@ -166,6 +170,8 @@ static lc_status init_unnamed() {
 
 // --- A line
 
+namespace {
+
 // One log line in the making.
 struct log_line {
     lc_log_state *state;
@@ -181,6 +187,8 @@ struct line_format {
     char text[FORMAT_CHARACTERS + 1];
     size_t used;
 };
+
+} // namespace
 
 static void add(line_format *format, const char *pattern, ...) __attribute__((format(printf, 2, 3)));
 // Drops what a cut has left of a conversion at the end of a format.
@@ -245,15 +253,7 @@ static void add_stamp(line_format *format, const log_line *line) {
 static void add_thread_mark(line_format *format, const log_line *line) {
     if (!lc_is_multithreaded || (line->flags & LC_LOG_FLAG_NO_THREAD))
         return;
-    const uint64_t native = static_cast<uint64_t>(syscall(SYS_gettid));
-    const lc_log_thread *const first = line->state->threads, *const end = first + line->state->thread_count;
-    const lc_log_thread *known = std::lower_bound(
-        first, end, native, [](const lc_log_thread &entry, uint64_t id) { return entry.native_id < id; });
-    if (known != end && known->native_id == native) {
-        add(format, "%s %lu: ", "tid", static_cast<unsigned long>(known->logged_id));
-        return;
-    }
-    add(format, "%s %lu: ", "TID", static_cast<unsigned long>(native));
+    add(format, "TID %lu: ", static_cast<unsigned long>(syscall(SYS_gettid)));
 }
 
 static const char *component_name(uint32_t component) {
@@ -422,4 +422,28 @@ void util_log(int32_t level, const char *prefix, const char *format, ...) {
     va_end(arguments);
     if (lc_log_check_level(level))
         (void)qv_log_internal(level, nullptr, nullptr, "%s%s", prefix ? prefix : "", text);
+}
+
+// --- A plain file
+
+int lc_log_file(const char *path, const char *format, ...) {
+    const cancel_off_guard uncancelled;
+    struct stat status = {};
+    const bool small = stat(DEBUG_LOG, &status) != 0 || status.st_size <= DEBUG_LOG_MAX_BYTES;
+    FILE *file = fopen(path ? path : DEBUG_LOG, small ? "ae" : "we");
+    if (!file)
+        return 1;
+    const time_t now = time(nullptr);
+    tm local = {};
+    localtime_r(&now, &local);
+    char stamp[32];
+    strftime(stamp, sizeof stamp, "%m%d%y %d%H%M", &local);
+    fprintf(file, "%s ", stamp);
+    va_list arguments;
+    va_start(arguments, format);
+    vfprintf(file, format, arguments);
+    va_end(arguments);
+    fputc('\n', file);
+    fclose(file);
+    return 0;
 }

@@ -81,8 +81,6 @@ struct lc_log_levels {
 };
 lc_status lc_log_save_levels(lc_log_levels *out);
 lc_status lc_log_restore_levels(const lc_log_levels *saved);
-// Lines of the calling thread carry this number from now on, in the place of the system's.
-lc_status lc_log_set_thread_id(uint32_t logged_id);
 
 // The facility of a process: from its file, or with a session from the management tree, for which the host of
 // this room lends `lc_log_facility_from_session` (null until it does).

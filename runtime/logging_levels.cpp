@@ -15,7 +15,6 @@
 #include <cstring>
 
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -24,8 +23,6 @@
 constexpr const char *LEVEL_LINK = "/var/opt/rvl/output/sysloglevel";
 constexpr const char *TIME_ZONE_FILE = "/var/opt/rvl/output/localtime";
 constexpr const char *FACILITY_FILE = "/var/opt/rvl/syslog_fac.conf";
-constexpr const char *DEBUG_LOG = "/var/log/debug_log";
-constexpr off_t DEBUG_LOG_MAX_BYTES = 2000000;
 constexpr int32_t DEFAULT_FACILITY = LOG_LOCAL1;
 
 std::atomic<int32_t> G_log_level{LC_LOG_NOTICE};
@@ -135,6 +132,8 @@ bool log_poll_time_zone(lc_log_state *state, time_t now) {
 
 // --- Levels as management sets them
 
+namespace {
+
 // The log state under its lock, null before lc_log_init and after lc_log_close.
 struct locked_state {
     locked_state() : guard(G_log_state_lock), state(G_log_state_lock ? G_log_state : nullptr) {}
@@ -142,6 +141,8 @@ struct locked_state {
     const lc_lock_guard guard;
     lc_log_state *const state;
 };
+
+} // namespace
 
 static lc_status set_system_level(int32_t level) {
     const locked_state log;
@@ -177,18 +178,6 @@ lc_status lc_log_set_daemon_log_level(int32_t level) {
 
 int32_t lc_log_get_daemon_log_level() {
     return G_daemon_log_level;
-}
-
-const char *lc_log_get_lls_process_name() {
-    return G_log_state ? G_log_state->process_name : "";
-}
-
-lc_status lc_log_get_syslog_facility(int32_t *out_facility) {
-    CHECK_NULL(out_facility);
-    *out_facility = 0;
-    CHECK_NULL(G_log_state);
-    *out_facility = G_log_state->facility;
-    return LC_OK;
 }
 
 static void settle_overrides(lc_log_state *state, bool overrides) {
@@ -269,35 +258,15 @@ lc_status lc_log_restore_levels(const lc_log_levels *saved) {
     return LC_OK;
 }
 
-// --- Threads
-
-static lc_status name_thread(uint64_t native_id, uint32_t logged_id) {
-    const locked_state log;
-    if (!log.state)
-        return LC_NULL;
-    uint32_t place = 0;
-    while (place < log.state->thread_count && log.state->threads[place].native_id < native_id)
-        place++;
-    if (place == log.state->thread_count || log.state->threads[place].native_id != native_id) {
-        const size_t bytes = (log.state->thread_count + size_t{1}) * sizeof(lc_log_thread);
-        auto *larger = static_cast<lc_log_thread *>(realloc(log.state->threads, bytes));
-        if (!larger)
-            return LC_NULL;
-        log.state->threads = larger;
-        memmove(larger + place + 1, larger + place,
-                (log.state->thread_count - place) * sizeof(lc_log_thread));
-        log.state->thread_count++;
-    }
-    log.state->threads[place] = {native_id, logged_id};
-    return LC_OK;
-}
-
-lc_status lc_log_set_thread_id(uint32_t logged_id) {
-    CHECK_STATUS(name_thread(static_cast<uint64_t>(syscall(SYS_gettid)), logged_id));
-    return LC_OK;
-}
-
 // --- Facility
+
+lc_status lc_log_get_syslog_facility(int32_t *out_facility) {
+    CHECK_NULL(out_facility);
+    *out_facility = 0;
+    CHECK_NULL(G_log_state);
+    *out_facility = G_log_state->facility;
+    return LC_OK;
+}
 
 static void facility_from_file(const char *process_name, int32_t *facility) {
     FILE *file = fopen(FACILITY_FILE, "re");
@@ -329,26 +298,4 @@ int32_t lc_log_get_facility(mdc *session, const char *process_name) {
     else if (lc_log_facility_from_session && lc_log_facility_from_session(session, &from_session) == LC_OK)
         facility = static_cast<int32_t>(from_session);
     return facility;
-}
-
-int lc_log_file(const char *path, const char *format, ...) {
-    const cancel_off_guard uncancelled;
-    struct stat status = {};
-    const bool small = stat(DEBUG_LOG, &status) != 0 || status.st_size <= DEBUG_LOG_MAX_BYTES;
-    FILE *file = fopen(path ? path : DEBUG_LOG, small ? "ae" : "we");
-    if (!file)
-        return 1;
-    const time_t now = time(nullptr);
-    tm local = {};
-    localtime_r(&now, &local);
-    char stamp[32];
-    strftime(stamp, sizeof stamp, "%m%d%y %d%H%M", &local);
-    fprintf(file, "%s ", stamp);
-    va_list arguments;
-    va_start(arguments, format);
-    vfprintf(file, format, arguments);
-    va_end(arguments);
-    fputc('\n', file);
-    fclose(file);
-    return 0;
 }

@@ -13,11 +13,6 @@
 
 enum : uint8_t { LOG_TO_SYSLOG = 1, LOG_TO_STDOUT = 2, LOG_TO_STDERR = 4 };
 
-struct lc_log_thread {
-    uint64_t native_id;
-    uint32_t logged_id;
-};
-
 struct lc_log_state {
     char process_name[32];
     char prefix[80];
@@ -26,8 +21,6 @@ struct lc_log_state {
     int32_t initial_max_level;
     uint8_t destinations;
     int32_t facility;
-    lc_log_thread *threads; // sorted, null until used
-    uint32_t thread_count;
     char host_name[256];
     pid_t process_id;
     int32_t openlog_options;

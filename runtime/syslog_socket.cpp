@@ -47,10 +47,6 @@ void syslog_set_mask(int32_t level) {
     mask = (1 << ((level + 1) & 31)) - 1;
 }
 
-int32_t syslog_get_mask() {
-    return mask;
-}
-
 void syslog_socket_close(syslog_socket *log) {
     if (log->fd >= 0)
         close(log->fd);

@@ -32,4 +32,3 @@ int syslog_socket_send(syslog_socket *log, int32_t level, const char *format, ..
 
 // Passes levels up to this one: bit n of the mask stands for level n.
 void syslog_set_mask(int32_t level);
-int32_t syslog_get_mask();

@@ -153,11 +153,6 @@ lc_status tb_dup(const tbuffer *buffer, tbuffer **out) {
     *out = copy.take();
     return LC_OK;
 }
-lc_status tb_set_auto_shrink(tbuffer *buffer, int on) {
-    CHECK_NULL(buffer);
-    buffer->auto_shrink = on ? 1 : 0;
-    return on ? fit(buffer, uint64_t{buffer->length} + 1) : LC_OK;
-}
 
 // ---- Plain access
 

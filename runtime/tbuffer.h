@@ -20,8 +20,8 @@ struct tbuffer {
     uint8_t *buffer;
     uint32_t length;
     uint32_t size;
-    uint8_t auto_shrink;
-    uint8_t constant; // the bytes are borrowed; writers refuse
+    uint8_t auto_shrink; // set by the owner: the buffer gives memory back when it becomes shorter
+    uint8_t constant;    // the bytes are borrowed; writers refuse
 };
 
 lc_status tb_new(tbuffer **out);
@@ -32,7 +32,6 @@ lc_status tb_new_buf_const(tbuffer **out, const void *bytes, uint32_t length);
 lc_status tb_free(tbuffer **inout);
 lc_status tb_detach(tbuffer **inout, uint8_t **out_bytes, uint32_t *out_length);
 lc_status tb_dup(const tbuffer *buffer, tbuffer **out);
-lc_status tb_set_auto_shrink(tbuffer *buffer, int on);
 
 int32_t tb_length(const tbuffer *buffer); // -1 for null
 uint32_t tb_size(const tbuffer *buffer);

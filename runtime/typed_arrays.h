@@ -139,7 +139,6 @@ lc_status typed_foreach(Family *list, typed_foreach_function<Family, Element> fu
     lc_status F##_push(F *list, typed_element<E>::given value);                                              \
     lc_status F##_insert_sorted(F *list, typed_element<E>::given value);                                     \
     lc_status F##_set(F *list, uint32_t index, typed_element<E>::given value);                               \
-    lc_status F##_insert(F *list, uint32_t index, typed_element<E>::given value);                            \
     lc_status F##_insert_sorted_hint(F *list, typed_element<E>::given value, uint32_t hint);                 \
     lc_status F##_append_takeover(F *list, E *inout);                                                        \
     lc_status F##_append_no_dup_takeover(F *list, E *inout);                                                 \
@@ -217,9 +216,6 @@ lc_status typed_foreach(Family *list, typed_foreach_function<Family, Element> fu
     }                                                                                                        \
     lc_status F##_set(F *list, uint32_t index, typed_element<E>::given value) {                              \
         return array_set(typed_list(list), index, typed_element<E>::to_slot(value));                         \
-    }                                                                                                        \
-    lc_status F##_insert(F *list, uint32_t index, typed_element<E>::given value) {                           \
-        return array_insert(typed_list(list), index, typed_element<E>::to_slot(value));                      \
     }                                                                                                        \
     lc_status F##_insert_sorted_hint(F *list, typed_element<E>::given value, uint32_t hint) {                \
         return array_insert_sorted_hint(typed_list(list), typed_element<E>::to_slot(value), hint);           \

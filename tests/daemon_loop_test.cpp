@@ -254,8 +254,8 @@ TEST_F(Signals, AreCallbacksInTheLoop) {
         EXPECT_EQ(lew_event_delete(wrapper, &slots[0]), LC_OK);
         EXPECT_EQ(slots[0], nullptr);
     }
-    EXPECT_EQ(le_signal_context(SIGUSR1), nullptr);
-    EXPECT_EQ(le_signal_context(SIGUSR2), loop);
+    EXPECT_EQ(le_signal_contexts[SIGUSR1], nullptr);
+    EXPECT_EQ(le_signal_contexts[SIGUSR2], loop);
     // One ends a wait.
     const pthread_t self = pthread_self();
     std::thread sender([&] {
@@ -307,7 +307,7 @@ TEST_F(Signals, AreOneContextsAndTheirNumberIsChecked) {
     EXPECT_EQ(reg(other, &slot, SIGUSR2), LC_NOT_FOUND);
     EXPECT_EQ(lew_event_delete(other, &slot), LC_NOT_FOUND);
     EXPECT_EQ(reg(wrapper, &slot, SIGUSR2), LC_OK);
-    EXPECT_EQ(le_signal_context(SIGUSR1), nullptr);
+    EXPECT_EQ(le_signal_contexts[SIGUSR1], nullptr);
     EXPECT_EQ(reg(other, &foreign, SIGUSR1), LC_OK);
     EXPECT_EQ(lew_event_cancel(other, &foreign), LC_OK);
     EXPECT_EQ(lew_event_cancel(other, &foreign), LC_OK);

@@ -70,7 +70,8 @@ TEST(Arrays, KnowWhetherTheyAreInOrder) {
     EXPECT_EQ(uint32_array_insert_sorted(list, 2), LC_OK);
     EXPECT_EQ(uint32_array_insert_sorted(list, 0), LC_OK);
     EXPECT_EQ(values(list), (numbers{0, 1, 1, 2, 2, 2, 2, 3}));
-    EXPECT_EQ(uint32_array_insert(list, 1, 9), LC_OK); // out of order
+    out = 9;
+    EXPECT_EQ(uint32_array_insert_takeover(list, 1, &out), LC_OK); // out of order
     EXPECT_EQ(uint32_array_binary_search(list, 2, &index), LC_ASSERTION);
     EXPECT_TRUE(uint32_array_remove(list, 1, &out) == LC_OK && out == 9);
     EXPECT_TRUE(uint32_array_pop(list, &out) == LC_OK && out == 3);

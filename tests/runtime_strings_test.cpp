@@ -198,8 +198,9 @@ TEST(Buffers, SizesGrowAndShrink) {
     EXPECT_EQ(size_left(tb_ensure_size(buffer, 0x1000000), buffer), 0x1000000u);
     EXPECT_EQ(size_left(tb_ensure_size(buffer, 0x1000001), buffer), 0x1000001u + 0x800000u + 0xfffu);
     EXPECT_EQ(tb_ensure_size(buffer, 0x10000001), LC_ASSERTION);
-    EXPECT_EQ(size_left(tb_set_auto_shrink(buffer, 1), buffer), 256u);
-    EXPECT_EQ(tb_length(buffer), 128);
+    buffer->auto_shrink = 1;
+    EXPECT_EQ(tb_append_uint8(buffer, 'z'), LC_OK);
+    EXPECT_EQ(size_left(tb_set_length(buffer, 128), buffer), 256u);
     EXPECT_EQ(tb_buf(buffer)[127], 'y');
 }
 
