@@ -86,7 +86,7 @@ void check_binding(const bn_binding *binding) {
     for (uint32_t id = 0; id < bn_attrib_array_length_quick(attributes); id++)
         if (const bn_attrib *attribute = bn_attrib_array_get_quick(attributes, id)) {
             REQUIRE(attribute->attribute_id == id && bn_attrib_id_valid(id));
-            REQUIRE(bn_type_known(attribute->type) && (attribute->type_flags & BN_TYPE_MASK) == 0);
+            REQUIRE(lc_enum_to_string_quiet_null(bn_type_table, static_cast<int32_t>(attribute->type)) && (attribute->type_flags & BN_TYPE_MASK) == 0);
         }
 }
 

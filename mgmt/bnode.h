@@ -43,12 +43,6 @@ lc_status bn_attrib_get_tstring_const(const bn_attrib *attrib, uint32_t *out_id,
                                       const tstring **out);
 lc_status bn_attrib_get_tbuf_const(const bn_attrib *attrib, uint32_t *out_id, uint32_t *out_type_and_flags,
                                    const tbuffer **out);
-// Sets a binary or string value of `length` bytes.
-lc_status bn_attrib_set_bytes(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags,
-                              const void *bytes, uint32_t length);
-// An attribute of the family's fixed size, for the typed operations.
-lc_status bn_attrib_set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags,
-                              const void *value, uint32_t size);
 
 // ---- Bindings
 

@@ -93,6 +93,7 @@ lc_status bn_binding_array_get_value_tstr_by_name(const bn_binding_array *array,
     return LC_OK;
 }
 
+namespace {
 // "prefix/relative", on the stack where it fits.
 struct relative_name {
     char buffer[256];
@@ -110,6 +111,8 @@ struct relative_name {
     relative_name &operator=(const relative_name &) = delete;
     ~relative_name() { free(heap); }
 };
+} // namespace
+
 lc_status bn_binding_array_get_binding_by_name_rel(const bn_binding_array *array, const char *prefix,
                                                    const char *relative, const bn_binding **out) {
     CHECK_NULL(out);
@@ -130,6 +133,7 @@ lc_status bn_binding_array_get_value_tstr_by_name_rel(const bn_binding_array *ar
 
 // ---- By pattern
 
+namespace {
 // One walk over the names that can match, in order.
 struct pattern_walk {
     const bn_binding_array *array = nullptr;
@@ -138,6 +142,7 @@ struct pattern_walk {
     uint32_t next = 0;
     bool in_order = false;
 };
+} // namespace
 
 static lc_status begin_walk(pattern_walk *walk, const bn_binding_array *array, const char *pattern,
                             uint32_t first) {

@@ -97,8 +97,8 @@ static void begin(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags)
     attrib->type = type;
     attrib->type_flags = flags & ~BN_TYPE_MASK;
 }
-lc_status bn_attrib_set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags,
-                              const void *value, uint32_t size) {
+static lc_status set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags, const void *value,
+                           uint32_t size) {
     CHECK_NULL(attrib);
     CHECK_NULL(value);
     CHECK_CONDITION(bn_attrib_id_valid(id));
@@ -108,33 +108,6 @@ lc_status bn_attrib_set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uin
     attrib->value_size = size;
     return LC_OK;
 }
-lc_status bn_attrib_set_bytes(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags,
-                              const void *bytes, uint32_t length) {
-    CHECK_NULL(attrib);
-    CHECK_CONDITION(bn_attrib_id_valid(id));
-    const bn_type_row *row = bn_type_find(type);
-    CHECK_CONDITION(row && (row->shape == value_shape::text || row->shape == value_shape::binary));
-    owned<tbuffer, tb_release> binary;
-    owned<tstring, ts_release> string;
-    CHECK_CONDITION(length < tb_size_max);
-    CHECK_STATUS(tb_new_size(&binary.pointer, length + 1));
-    CHECK_STATUS(tb_append_buf(binary.pointer, bytes, length));
-    if (row->shape == value_shape::text) {
-        owned_text text;
-        uint8_t *detached = nullptr;
-        CHECK_STATUS(tb_detach(&binary.pointer, &detached, nullptr));
-        text.pointer = reinterpret_cast<char *>(detached);
-        CHECK_STATUS(ts_new_str_takeover(&string.pointer, &text.pointer, static_cast<int32_t>(length), -1));
-    }
-    begin(attrib, id, type, flags);
-    if (string.pointer)
-        attrib->value.string = string.take();
-    else
-        attrib->value.binary = binary.take();
-    attrib->value_size = length;
-    return LC_OK;
-}
-
 // The attribute is changed when the text has become a value, and keeps its old one otherwise.
 lc_status bn_attrib_set_str(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags, const char *text) {
     CHECK_NULL(attrib);
@@ -259,7 +232,7 @@ static lc_status make_fixed(bn_attrib **out, uint32_t id, uint32_t type, uint32_
     *out = nullptr;
     owned<bn_attrib, bn_release_attrib> attrib;
     CHECK_STATUS(bn_attrib_new(&attrib.pointer));
-    CHECK_STATUS(bn_attrib_set_fixed(attrib.pointer, id, type, flags, value, size));
+    CHECK_STATUS(set_fixed(attrib.pointer, id, type, flags, value, size));
     *out = attrib.take();
     return LC_OK;
 }
@@ -305,7 +278,7 @@ static const Value *bn_at(const Value &value) {
 
 #define BN_DEFINE_TYPED(name, number, type, in, in_place, outs, give)                                        \
     lc_status bn_attrib_set_##name(bn_attrib *attrib, uint32_t id, uint32_t flags, BN_UNPAREN in) {          \
-        return bn_attrib_set_fixed(attrib, id, number, flags, in_place, sizeof(type));                       \
+        return set_fixed(attrib, id, number, flags, in_place, sizeof(type));                                 \
     }                                                                                                        \
     lc_status bn_attrib_new_##name(bn_attrib **out, uint32_t id, uint32_t flags, BN_UNPAREN in) {            \
         return make_fixed(out, id, number, flags, in_place, sizeof(type));                                   \

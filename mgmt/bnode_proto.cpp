@@ -1,5 +1,5 @@
-// Messages in memory: requests and responses are made, filled, read and freed here; nothing of them is kept
-// anywhere. The bytes stand in bnode_wire.cpp, the way over a session in bnode_proto_session.cpp.
+// Messages in memory: requests and responses are made, filled, read and freed here, and nothing of them is
+// kept anywhere else. bnode_proto_wire.cpp turns them into bytes and back, bnode_proto_session.cpp sends them.
 #include "mgmt/bnode_proto.h"
 
 #include <cstdlib>
@@ -52,8 +52,7 @@ uint16_t bn_request_msg_response_msg_type(uint16_t request_type) {
     }
 }
 
-// --- Nodes
-// ----------------------------------------------------------------------------------------------------------
+// ---- Nodes
 
 void bn_request_node_free(bn_request_node *node) {
     if (!node)
@@ -123,8 +122,7 @@ static void fill_response_nodes(array_options *options) {
 TYPED_ARRAY_DEFINE(bn_request_per_node_array, bn_request_node *, fill_request_nodes)
 TYPED_ARRAY_DEFINE(bn_response_per_node_array, bn_response_node *, fill_response_nodes)
 
-// --- Requests
-// -------------------------------------------------------------------------------------------------------
+// ---- Requests
 
 lc_status bn_request_msg_free(bn_request_msg **inout) {
     if (!inout || !*inout)
@@ -309,8 +307,7 @@ lc_status bn_request_set_transaction_id(bn_request_msg *msg, uint32_t transactio
     return LC_OK;
 }
 
-// --- Responses
-// ------------------------------------------------------------------------------------------------------
+// ---- Responses
 
 lc_status bn_response_msg_free(bn_response_msg **inout) {
     if (!inout || !*inout)
@@ -386,8 +383,7 @@ lc_status bn_response_msg_dup(const bn_response_msg *msg, bn_response_msg **out)
     return LC_OK;
 }
 
-// --- Reading
-// --------------------------------------------------------------------------------------------------------
+// ---- Reading
 
 int32_t bn_request_get_msg_id(const bn_request_msg *msg) {
     return msg ? static_cast<int32_t>(msg->msg_id) : -1;

@@ -5,10 +5,16 @@
 
 constexpr uint32_t DUMPED_NODES = 50;
 
+namespace {
 struct dump_target {
     int32_t level;
     const char *title;
 };
+// Between the title and the service: " local" and " peer", each only when there is one.
+struct dump_names {
+    const char *local_gap, *local, *peer_gap, *peer;
+};
+} // namespace
 #define DUMP(target, ...)                                                                                    \
     do {                                                                                                     \
         if (lc_log_check_level((target)->level))                                                             \
@@ -24,10 +30,6 @@ static const char *text_or_empty(const tstring *text) {
     return text ? ts_str(text) : "";
 }
 
-// Between the title and the service: " local" and " peer", each only when there is one.
-struct dump_names {
-    const char *local_gap, *local, *peer_gap, *peer;
-};
 static dump_names names_of(gcl_session *session) {
     const char *local = nullptr, *peer = nullptr;
     if (session)

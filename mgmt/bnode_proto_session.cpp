@@ -13,6 +13,7 @@
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
 
+namespace {
 struct bn_callback {
     bn_request_callback request; // of odd types
     bn_response_callback response;
@@ -32,6 +33,7 @@ struct bn_session_state {
     uint16_t service; // the session's bnode service, 0 until it is known
     bn_callback callbacks[MSG_TYPES];
 };
+} // namespace
 
 static bn_instance_state *instance_state(gcl *instance) {
     gcl_body_protocol *protocol = gcl_get_body_protocol(instance, BN_PROTO);
@@ -41,8 +43,7 @@ static bn_session_state *session_state(gcl_session *session) {
     return static_cast<bn_session_state *>(gcl_session_get_protocol_state(session, BN_PROTO));
 }
 
-// --- Callbacks
-// ------------------------------------------------------------------------------------------------------
+// ---- Callbacks
 
 static lc_status set_global(gcl *instance, uint16_t type, bn_callback callback) {
     CHECK_NULL(instance);
@@ -86,8 +87,7 @@ BN_RESPONSE_SETTERS(action_response, bn_msg_action_response)
 BN_REQUEST_SETTERS(event_request, bn_msg_event)
 BN_RESPONSE_SETTERS(event_response, bn_msg_event_ack)
 
-// --- Sending
-// --------------------------------------------------------------------------------------------------------
+// ---- Sending
 
 // The service that the session speaks: its bnode service, or else the one that the opening brought.
 static uint16_t service_of(gcl_session *session) {
@@ -119,46 +119,58 @@ static bool is_connected(gcl_session *session) {
     return gcl_session_get_state(session, &state, nullptr) == LC_OK && state == GCL_SESSION_CONNECTED;
 }
 
-lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg) {
-    CHECK_NULL(session);
-    CHECK_NULL(msg);
-    const gcl_session_guard guard(session);
-    CHECK_STATUS(number_message(session, msg));
+namespace {
+// What differs between sending the two kinds of message.
+struct request_kind {
+    static constexpr const char *title = "SEND REQ", *word = "request";
+    static constexpr auto serialize = bn_request_msg_serialize;
+    static constexpr auto dump = bn_request_msg_dump;
+};
+struct response_kind {
+    static constexpr const char *title = "SEND RESP", *word = "response";
+    static constexpr auto serialize = bn_response_msg_serialize;
+    static constexpr auto dump = bn_response_msg_dump;
+};
+} // namespace
+
+static lc_status add_audit_user(gcl_session *session, bn_request_msg *msg) {
     const bn_instance_state *state = instance_state(gcl_session_get_instance(session));
     const bool audited = msg->msg_type == bn_msg_set_request || msg->msg_type == bn_msg_action_request;
     if (audited && state->audit_user && !msg->audit_user)
         CHECK_STATUS(ts_dup(state->audit_user, &msg->audit_user));
-    owned_tbuffer buffer;
-    CHECK_STATUS(bn_request_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &buffer.pointer));
-    bn_request_msg_dump(session, msg, LC_LOG_DEBUG, "SEND REQ");
-    if (!is_connected(session)) {
-        LC_LOG(LC_LOG_INFO, "Dropping request to non-connected session %d", gcl_session_get_id(session));
-        return LC_OK;
-    }
-    CHECK_STATUS(gcl_session_send_frame_components_tb(session, BN_PROTO, msg->msg_type, BN_FRAME_HEADER_BYTES,
-                                                      &buffer.pointer));
+    return LC_OK;
+}
+static lc_status add_audit_user(gcl_session *, bn_response_msg *) {
     return LC_OK;
 }
 
-lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg) {
+template <typename Kind, typename Message>
+static lc_status send_message(gcl_session *session, Message *msg) {
     CHECK_NULL(session);
     CHECK_NULL(msg);
     const gcl_session_guard guard(session);
     CHECK_STATUS(number_message(session, msg));
+    CHECK_STATUS(add_audit_user(session, msg));
     owned_tbuffer buffer;
-    CHECK_STATUS(bn_response_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &buffer.pointer));
-    bn_response_msg_dump(session, msg, LC_LOG_DEBUG, "SEND RESP");
+    CHECK_STATUS(Kind::serialize(msg, BN_FRAME_HEADER_BYTES, &buffer.pointer));
+    Kind::dump(session, msg, LC_LOG_DEBUG, Kind::title);
     if (!is_connected(session)) {
-        LC_LOG(LC_LOG_INFO, "Dropping response to non-connected session %d", gcl_session_get_id(session));
+        LC_LOG(LC_LOG_INFO, "Dropping %s to non-connected session %d", Kind::word,
+               gcl_session_get_id(session));
         return LC_OK;
     }
     CHECK_STATUS(gcl_session_send_frame_components_tb(session, BN_PROTO, msg->msg_type, BN_FRAME_HEADER_BYTES,
                                                       &buffer.pointer));
     return LC_OK;
 }
+lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg) {
+    return send_message<request_kind>(session, msg);
+}
+lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg) {
+    return send_message<response_kind>(session, msg);
+}
 
-// --- Receiving
-// ------------------------------------------------------------------------------------------------------
+// ---- Receiving
 
 static const char *const kind_words[] = {"query", "set", "action", "event"};
 static const char *kind_word(uint16_t type) {
@@ -233,8 +245,7 @@ static lc_status receive_frame(gcl_session *session, gcl_body_protocol *protocol
     return LC_OK;
 }
 
-// --- The protocol
-// ---------------------------------------------------------------------------------------------------
+// ---- The protocol
 
 static lc_status session_new(gcl_session *session, gcl_body_protocol *protocol) {
     const bn_instance_state *shared = static_cast<const bn_instance_state *>(protocol->state);

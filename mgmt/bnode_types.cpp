@@ -162,12 +162,14 @@ static lc_status named_in(const bn_type_row *row, const char *text, bn_attrib *a
 
 // ---- Times: the form says how many microseconds a unit has and which texts are meant
 
+namespace {
 struct time_form {
     int64_t unit_us;
     lc_status (*to_str)(int64_t us, char **out);
     lc_status (*from_str)(const char *text, int64_t *out_us);
     bool plain_without_display; // durations
 };
+} // namespace
 static lc_status datetime_to_str(int64_t us, char **out) {
     return lt_datetime_us_to_str(us, 0, out);
 }
@@ -378,11 +380,13 @@ static constexpr bn_type_row rows[] = {
 constexpr size_t ROW_COUNT = sizeof rows / sizeof rows[0];
 
 // What is looked up by number or by name is made of the rows when this file is compiled.
+namespace {
 struct derived_tables {
     lc_enum_entry names[ROW_COUNT + 1];
     bn_attrib_copy_func wire[BN_TYPE_LAST + 1];
     const bn_type_row *by_number[BN_TYPE_LAST + 1];
 };
+} // namespace
 static constexpr derived_tables derive() {
     derived_tables tables{};
     for (size_t i = 0; i < ROW_COUNT; i++) {
@@ -405,9 +409,6 @@ const bn_type_row *bn_type_find(uint32_t type_and_flags) {
 
 static const bn_type_row *row_with_value(uint32_t type_and_flags) {
     return type_and_flags & bn_flag_no_value ? nullptr : bn_type_find(type_and_flags);
-}
-bool bn_type_known(uint32_t type_and_flags) {
-    return bn_type_find(type_and_flags) != nullptr;
 }
 bool bn_type_numeric(uint32_t type_and_flags) {
     const bn_type_row *row = row_with_value(type_and_flags);

@@ -85,7 +85,6 @@ extern const lc_enum_entry *const bn_type_table;
 extern const lc_enum_entry bn_attribute_id_table[];
 
 // Predicates over a type word. With the invalid or the absent flag a type counts as having no value.
-bool bn_type_known(uint32_t type_and_flags);
 bool bn_type_numeric(uint32_t type_and_flags);
 bool bn_type_string(uint32_t type_and_flags);
 bool bn_type_tbuf(uint32_t type_and_flags);
