@@ -13,6 +13,7 @@
 
 #include "engine/wccp_assignment.h"
 #include "engine/wccp_mgr.h"
+#include "engine/wccp_pkt_unload.h"
 #include "engine/wccp_router_utils.h"
 #include "engine/wccp_view_utils.h"
 #include "engine/wccp_wire.h"
@@ -178,14 +179,15 @@ void views_of_an_unchanged_report(benchmark::State &state) {
             .head = {host(i + 1), {}, {}}, .bucket_words = {}, .weight = to_be16(100), .status = {}};
         elements[i].bucket_words[i / 4] = to_be32(0xffu << (i % 4 * 8));
     }
+    const wccp_view_elements bytes = {reinterpret_cast<const uint8_t *>(elements.data()),
+                                      static_cast<uint32_t>(elements.size() * sizeof elements[0])};
     wccp_sending_router *router = shared.router(ROUTER_A);
     wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES];
     const auto take = [&] {
         wccp_assign_summary hash, mask = {};
         memset(decoded, 0, sizeof decoded);
         if (wccp_update_router_view(group, router, 32, routers.data()) ||
-            wccp_process_router_view_web_cache_id_elements(
-                group, 32, reinterpret_cast<const uint8_t *>(elements.data()), decoded, &hash) ||
+            wccp_process_router_view_web_cache_id_elements(group, 32, bytes, decoded, &hash) ||
             wccp_update_appliance_view(group, router, 32, decoded) ||
             wccp_update_appliance_redirect_status(group, router, &hash, &mask))
             abort();

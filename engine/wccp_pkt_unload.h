@@ -1,10 +1,16 @@
-// The reader's side of the wire format: checks, moves the cursor, hands out places in the packet. Changes
-// nothing in a group but rx_unknown_capabilities. What a result points to is valid until the next receive.
+// The reader's side of the wire format: it checks, moves the cursor and hands out pointers into the packet,
+// which are valid until the next receive. All of it returns 0, or 1 for what it refuses, and changes nothing
+// in a group but rx_unknown_capabilities. Lock held.
 #pragma once
 
 #include "engine/wccp_records.h"
 #include "engine/wccp_wire.h"
 
+// The web-cache elements of a Router View as they were received.
+struct wccp_view_elements {
+    const uint8_t *first;
+    uint32_t size; // bytes
+};
 struct wccp_rtr_view_info {
     be32 change_number;
     be32 key_ipa;
@@ -12,7 +18,7 @@ struct wccp_rtr_view_info {
     uint32_t router_count;
     uint32_t appliance_count;
     const be32 *routers;
-    const uint8_t *appliances; // first web-cache element
+    wccp_view_elements appliances;
 };
 struct wccp_assign_map_info { // zeroed by the caller
     uint32_t present;
@@ -31,6 +37,23 @@ struct wccp_command_info {
     uint32_t data;
 };
 
+// What one router assigns to this appliance.
+struct wccp_assign_summary {
+    uint32_t valid;       // 1: this summary is the one to use
+    uint16_t self_count;  // buckets or values that the router gives to this appliance
+    uint16_t total_count; // buckets or values that it gives to anybody
+};
+
+// Which of its forms a web-cache element of a Router View has: its flags and the group's compatibility mode
+// decide.
+enum wccp_element_form : uint8_t { WCCP_ELEMENT_HASH, WCCP_ELEMENT_NO_REDIRECT, WCCP_ELEMENT_REDIRECT };
+struct wccp_element_shape {
+    wccp_element_form form;
+    uint32_t size;      // bytes
+    uint32_t weight_at; // offset in bytes
+};
+wccp_element_shape wccp_view_element_shape(uint16_t flags, uint32_t compat_mode);
+
 int wccp_pkt_unload_msg_header(wccp_pkt *pkt, const wccp_wire_msg_header **out);
 int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_security_info **out,
                                             uint8_t **out_digest);
@@ -46,3 +69,9 @@ int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *p
 int wccp_pkt_unload_router_query_component(wccp_service_group *group, wccp_pkt *pkt,
                                            const wccp_wire_router_query **out);
 int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt);
+// Decodes `count` elements, in their order, and sums up what the hash forms assign. `decoded` has room for
+// WCCP_MAX_APPLIANCES entries and is zeroed. Also 1 for a null group, `decoded` or `out_hash`.
+int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, uint32_t count,
+                                                   wccp_view_elements elements,
+                                                   wccp_rtr_view_appliance *decoded,
+                                                   wccp_assign_summary *out_hash);

@@ -24,15 +24,13 @@
 #include <cstring>
 
 #include "engine/wccp_alarms.h"
-#include "engine/wccp_assignment.h"
+#include "engine/wccp_pkt_unload.h"
 #include "engine/wccp_router_utils.h"
 #include "engine/wccp_state.h"
 #include "engine/wccp_utils.h"
-#include "engine/wccp_wire.h"
 #include "runtime/list.h"
 
 static constexpr uint32_t MARK = 1;
-static constexpr uint16_t HASH_BUCKETS = WCCP_MAX_BUCKETS;
 
 // The lists.
 
@@ -196,68 +194,6 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
 }
 
 // Appliances.
-
-// The weight of a web-cache element stands where its form says, and has been checked to lie in the message.
-static uint16_t weight_of(const uint8_t *element, const wccp_element_shape &shape) {
-    be16 weight;
-    memcpy(&weight, element + shape.weight_at, sizeof weight);
-    return to_host(weight);
-}
-
-// Takes the bucket bits of an element over; the number of buckets that they assign. The bits are added up
-// side by side in one word: without a machine instruction for it, eight calls that count one word each would
-// be the dearest thing in a whole I-See-You.
-static uint16_t take_bucket_bits(const wccp_wire_view_element_hash *element,
-                                 wccp_rtr_view_appliance *decoded) {
-    uint64_t in_bytes = 0;
-    for (uint32_t i = 0; i < 8; i += 2) {
-        decoded->bucket_bits[i] = to_host(element->bucket_words[i]);
-        decoded->bucket_bits[i + 1] = to_host(element->bucket_words[i + 1]);
-        uint64_t bits = uint64_t{decoded->bucket_bits[i]} << 32 | decoded->bucket_bits[i + 1];
-        bits -= (bits >> 1) & 0x5555555555555555;
-        bits = (bits & 0x3333333333333333) + ((bits >> 2) & 0x3333333333333333);
-        in_bytes += (bits + (bits >> 4)) & 0x0f0f0f0f0f0f0f0f;
-    }
-    const uint64_t in_pairs = (in_bytes & 0x00ff00ff00ff00ff) + ((in_bytes >> 8) & 0x00ff00ff00ff00ff);
-    decoded->buckets_assigned = static_cast<uint16_t>((in_pairs * 0x0001000100010001) >> 48);
-    decoded->buckets_total = HASH_BUCKETS;
-    return decoded->buckets_assigned;
-}
-
-int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, uint32_t count,
-                                                   const uint8_t *elements, wccp_rtr_view_appliance *decoded,
-                                                   wccp_assign_summary *out_hash) {
-    if (!group || !decoded || !out_hash || count > WCCP_MAX_APPLIANCES)
-        return 1;
-    *out_hash = {.valid = 1, .self_count = 0, .total_count = 0};
-    uint32_t total = 0;
-    for (uint32_t i = 0; i < count; i++, decoded++) {
-        const auto *head = reinterpret_cast<const wccp_wire_view_element *>(elements);
-        const uint16_t flags = to_host(head->flags);
-        const wccp_element_shape shape = wccp_view_element_shape(flags, group->compat_mode);
-        decoded->ipa = head->web_cache_id;
-        if (shape.form == WCCP_ELEMENT_HASH && to_host(head->hash_revision) != 0) {
-            QV_LOG(LC_LOG_ERR, "WCCP GRP %d: HASH revision is not supported.", group->id);
-            return 1;
-        }
-        decoded->weight = weight_of(elements, shape);
-        if (shape.form == WCCP_ELEMENT_REDIRECT) {
-            out_hash->valid = 0; // the assignment comes as a map
-        } else if (shape.form == WCCP_ELEMENT_HASH && flags & WCCP_IDENTITY_HISTORICAL) {
-            QV_LOG(LC_LOG_INFO, "WCCP GRP %d: app id. %s assignment is historical, ignored", group->id,
-                   addr_text(decoded->ipa).s);
-        } else if (shape.form == WCCP_ELEMENT_HASH) {
-            const uint16_t assigned =
-                take_bucket_bits(reinterpret_cast<const wccp_wire_view_element_hash *>(elements), decoded);
-            if (decoded->ipa == group->appliance_ipa)
-                out_hash->self_count = assigned;
-            total += assigned;
-        }
-        elements += shape.size;
-    }
-    out_hash->total_count = static_cast<uint16_t>(total < HASH_BUCKETS ? total : HASH_BUCKETS);
-    return 0;
-}
 
 // A router reports another weight than it did before.
 static int take_reported_weight(wccp_service_group *group, const wccp_rtr_view_appliance *element) {

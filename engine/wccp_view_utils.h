@@ -4,20 +4,10 @@
 
 #include "engine/wccp_records.h"
 
-// What one router assigns to this appliance.
-struct wccp_assign_summary {
-    uint32_t valid;
-    uint16_t self_count;
-    uint16_t total_count;
-};
+struct wccp_assign_summary;
 
 int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                             const be32 *addresses);
-// `elements` is the first wire element; all of them have been checked to fit. `decoded` has room for 32,
-// zeroed.
-int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, uint32_t count,
-                                                   const uint8_t *elements, wccp_rtr_view_appliance *decoded,
-                                                   wccp_assign_summary *out_hash);
 int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                                const wccp_rtr_view_appliance *decoded);
 int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sending_router *router,

@@ -279,13 +279,3 @@ WIRE_SIZE(wccp_wire_assignment_map, 8);
 WIRE_AT(wccp_wire_assignment_map, mask_elements, 4);
 #undef WIRE_AT
 #undef WIRE_SIZE
-
-// Which of its forms a web-cache element of a router view has: told by flags and the group's compatibility
-// mode.
-enum wccp_element_form : uint8_t { WCCP_ELEMENT_HASH, WCCP_ELEMENT_NO_REDIRECT, WCCP_ELEMENT_REDIRECT };
-struct wccp_element_shape {
-    wccp_element_form form;
-    uint32_t size;
-    uint32_t weight_at;
-};
-wccp_element_shape wccp_view_element_shape(uint16_t flags, uint32_t compat_mode);

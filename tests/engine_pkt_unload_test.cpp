@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <bit>
 #include <cstring>
 
 #include "tests/support/engine_fixture.h"
@@ -235,6 +236,105 @@ TEST_F(Unload, TheFormOfAnElementFollowsFlagsAndMode) {
     group.compat_mode = WCCP_COMPAT_NEXUS;
     EXPECT_EQ(passed(read_view, ios), -1);
     EXPECT_EQ(passed(read_view, nexus), 56);
+}
+
+// Elements of a Router View decoded.
+
+const be32 OURS = {{10, 0, 0, 1}};
+
+wire_bytes element(uint32_t last_octet, uint32_t revision, uint32_t flags, const wire_bytes &middle,
+                   uint32_t weight) {
+    return wire_bytes().ip(0, last_octet).u16(revision).u16(flags).add(middle).u16(weight).u16(0);
+}
+wire_bytes hash_form(uint32_t last_octet, uint32_t weight, wire_bytes buckets, uint32_t flags = 0,
+                     uint32_t revision = 0) {
+    return element(last_octet, revision, flags, buckets.zeros(32 - buckets.size()), weight);
+}
+struct decoded_elements {
+    wccp_rtr_view_appliance list[WCCP_MAX_APPLIANCES] = {};
+    wccp_assign_summary hash = {9, 9, 9};
+    int result = -1;
+};
+// Without the last `cut` bytes.
+decoded_elements decode(wccp_service_group *group, const std::vector<wire_bytes> &elements, size_t cut = 0) {
+    group->appliance_ipa = OURS;
+    decoded_elements out;
+    wire_bytes all; // at an odd address, and not a byte longer than what is read
+    all.u8(0);
+    for (const wire_bytes &each : elements)
+        all.add(each);
+    const std::vector<uint8_t> place(all.bytes.begin(), all.bytes.end() - static_cast<long>(cut));
+    out.result = wccp_process_router_view_web_cache_id_elements(
+        group, static_cast<uint32_t>(elements.size()),
+        {place.data() + 1, static_cast<uint32_t>(place.size() - 1)}, out.list, &out.hash);
+    return out;
+}
+
+TEST_F(Unload, ElementsAreDecodedByTheirForm) {
+    const wire_bytes full = wire_bytes().fill(32, 0xff);
+    const std::vector<wire_bytes> elements = {
+        hash_form(1, 100, wire_bytes().hex("80010000 ff")),
+        hash_form(2, 0x1234, full),
+        hash_form(3, 7, full, WCCP_IDENTITY_HISTORICAL),
+        element(4, 0, 3, wire_bytes().zeros(20), 44),
+    };
+    const decoded_elements out = decode(&group, elements);
+    ASSERT_EQ(out.result, 0);
+    EXPECT_EQ(out.hash.valid, 1u);
+    EXPECT_EQ(out.hash.self_count, 10);
+    EXPECT_EQ(out.hash.total_count, 256); // 266, limited
+    const struct {
+        uint16_t weight, assigned, total;
+    } expected[] = {{100, 10, 256}, {0x1234, 256, 256}, {7, 0, 0}, {44, 0, 0}};
+    for (uint8_t i = 0; i < 4; i++) {
+        EXPECT_EQ(out.list[i].ipa, (be32{{10, 0, 0, static_cast<uint8_t>(i + 1)}}));
+        EXPECT_EQ(out.list[i].weight, expected[i].weight);
+        EXPECT_EQ(out.list[i].buckets_assigned, expected[i].assigned);
+        EXPECT_EQ(out.list[i].buckets_total, expected[i].total);
+    }
+    EXPECT_EQ(out.list[0].bucket_bits[0], 0x80010000u);
+    EXPECT_EQ(out.list[0].bucket_bits[1], 0xff000000u);
+
+    EXPECT_EQ(decode(&group, {}).result, 0);
+    EXPECT_EQ(decode(&group, {}).hash.total_count, 0);
+    // Another hash revision is refused, historical or not, and so are elements that end too early and a call
+    // without a place for the result.
+    EXPECT_EQ(decode(&group, {hash_form(1, 100, full), hash_form(2, 1, full, 0x80, 1)}).result, 1);
+    for (const wire_bytes &last : elements)
+        for (size_t cut = 3; cut <= last.size(); cut++) // the status in the last two bytes isn't read
+            EXPECT_EQ(decode(&group, {elements[3], last}, cut).result, 1) << last.size() << " - " << cut;
+    decoded_elements none;
+    EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(nullptr, 0, {}, none.list, &none.hash), 1);
+    EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(&group, 0, {}, nullptr, &none.hash), 1);
+    EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(&group, 0, {}, none.list, nullptr), 1);
+}
+
+TEST_F(Unload, AMaskElementWithRedirectLeavesTheAssignmentToTheMap) {
+    for (const uint32_t mode : {WCCP_COMPAT_IOS, WCCP_COMPAT_NEXUS}) {
+        group.compat_mode = mode;
+        const wire_bytes middle = wire_bytes().zeros(mode == WCCP_COMPAT_IOS ? 4 : 20);
+        const decoded_elements out =
+            decode(&group, {element(1, 0, 2, middle, 77), hash_form(2, 100, wire_bytes().hex("01"))});
+        ASSERT_EQ(out.result, 0);
+        EXPECT_EQ(out.hash.valid, 0u);
+        EXPECT_EQ(out.list[0].weight, 77);
+        EXPECT_EQ(out.list[1].ipa, (be32{{10, 0, 0, 2}}));
+        EXPECT_EQ(out.list[1].buckets_assigned, 1);
+    }
+}
+
+TEST_F(Unload, BucketBitsAreCountedWhateverTheirPattern) {
+    uint32_t state = 1;
+    for (int round = 0; round < 500; round++) {
+        wire_bytes buckets;
+        int expected = 0;
+        while (buckets.size() < 32) {
+            state = state * 1664525 + 1013904223;
+            buckets.u8(round % 3 == 0 ? state >> 24 | state >> 16 : state >> 24);
+            expected += std::popcount(buckets.bytes.back());
+        }
+        ASSERT_EQ(decode(&group, {hash_form(1, 1, buckets)}).list[0].buckets_assigned, expected);
+    }
 }
 
 TEST_F(Unload, AMapKeepsItsFirstMaskAndItsLastValues) {

@@ -2,7 +2,6 @@
 // routers assign.
 #include "engine/wccp_view_utils.h"
 
-#include <bit>
 #include <sstream>
 #include <string>
 #include <utility>
@@ -10,13 +9,12 @@
 
 #include <gtest/gtest.h>
 
+#include "engine/wccp_pkt_unload.h"
 #include "engine/wccp_state.h"
 #include "engine/wccp_utils.h"
-#include "engine/wccp_wire.h"
 #include "runtime/list.h"
 #include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
-#include "tests/support/wire_bytes.h"
 
 namespace {
 
@@ -170,100 +168,6 @@ TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     EXPECT_EQ(group->assign_timer.active + group->pending_acks, 0);
 }
 
-// Elements of a Router View, as they stand on the wire.
-wire_bytes element(uint32_t last_octet, uint32_t revision, uint32_t flags, const wire_bytes &middle,
-                   uint32_t weight) {
-    return wire_bytes().ip(0, last_octet).u16(revision).u16(flags).add(middle).u16(weight).u16(0);
-}
-wire_bytes hash_element(uint32_t last_octet, uint32_t weight, wire_bytes buckets, uint32_t flags = 0,
-                        uint32_t revision = 0) {
-    return element(last_octet, revision, flags, buckets.zeros(32 - buckets.size()), weight);
-}
-struct decoded_elements {
-    wccp_rtr_view_appliance list[WCCP_MAX_APPLIANCES] = {};
-    wccp_assign_summary hash = {9, 9, 9};
-    int result = -1;
-};
-decoded_elements decode(wccp_service_group *group, const std::vector<wire_bytes> &elements) {
-    decoded_elements out;
-    wire_bytes place; // on an odd address, and not a byte longer than what is read
-    place.u8(0);
-    for (const wire_bytes &each : elements)
-        place.add(each);
-    out.result = wccp_process_router_view_web_cache_id_elements(group, static_cast<uint32_t>(elements.size()),
-                                                                place.bytes.data() + 1, out.list, &out.hash);
-    return out;
-}
-
-TEST_F(ViewTest, ElementsAreReadByTheirForm) {
-    const wire_bytes full = wire_bytes().fill(32, 0xff);
-    const decoded_elements out = decode(group, {
-                                                   hash_element(1, 100, wire_bytes().hex("80010000 ff")),
-                                                   hash_element(2, 0x1234, full),
-                                                   hash_element(3, 7, full, WCCP_IDENTITY_HISTORICAL),
-                                                   element(4, 5, 3, wire_bytes().zeros(20), 44),
-                                               });
-    ASSERT_EQ(out.result, 0);
-    EXPECT_EQ(out.hash.valid, 1u);
-    EXPECT_EQ(out.hash.self_count, 10);
-    EXPECT_EQ(out.hash.total_count, 256); // 266, limited
-    const struct {
-        be32 ipa;
-        uint16_t weight, assigned, total;
-    } expected[] = {{US, 100, 10, 256}, {host(2), 0x1234, 256, 256}, {host(3), 7, 0, 0}, {host(4), 44, 0, 0}};
-    for (uint32_t i = 0; i < 4; i++) {
-        EXPECT_EQ(out.list[i].ipa, expected[i].ipa);
-        EXPECT_EQ(out.list[i].weight, expected[i].weight);
-        EXPECT_EQ(out.list[i].buckets_assigned, expected[i].assigned);
-        EXPECT_EQ(out.list[i].buckets_total, expected[i].total);
-    }
-    EXPECT_EQ(out.list[0].bucket_bits[0], 0x80010000u);
-    EXPECT_EQ(out.list[0].bucket_bits[1], 0xff000000u);
-
-    EXPECT_EQ(decode(group, {}).result, 0);
-    EXPECT_EQ(decode(group, {}).hash.total_count, 0);
-    // Another hash revision is refused, historical or not, and so is a call without a place for the result.
-    EXPECT_EQ(decode(group, {hash_element(1, 100, full), hash_element(2, 1, full, 0x80, 1)}).result, 1);
-    decoded_elements none;
-    EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(nullptr, 0, nullptr, none.list, &none.hash), 1);
-    EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(group, 0, nullptr, nullptr, &none.hash), 1);
-    EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(group, 0, nullptr, none.list, nullptr), 1);
-}
-
-TEST_F(ViewTest, AMaskElementWithRedirectLeavesTheAssignmentToTheMap) {
-    for (const uint32_t mode : {WCCP_COMPAT_IOS, WCCP_COMPAT_NEXUS}) {
-        group->compat_mode = mode;
-        const wire_bytes middle = wire_bytes().zeros(mode == WCCP_COMPAT_IOS ? 4 : 20);
-        const decoded_elements out =
-            decode(group, {element(1, 0, 2, middle, 77), hash_element(2, 100, wire_bytes().hex("01"))});
-        ASSERT_EQ(out.result, 0);
-        EXPECT_EQ(out.hash.valid, 0u);
-        EXPECT_EQ(out.list[0].weight, 77);
-        EXPECT_EQ(out.list[1].ipa, host(2));
-        EXPECT_EQ(out.list[1].buckets_assigned, 1);
-
-        const wccp_assign_summary no_map = {};
-        wccp_sending_router *a = router(ROUTER_A);
-        a->self_buckets = 5;
-        EXPECT_EQ(wccp_update_appliance_redirect_status(group, a, &out.hash, &no_map), 1);
-        EXPECT_EQ(a->self_buckets, 5);
-    }
-}
-
-TEST_F(ViewTest, BucketBitsAreCountedWhateverTheirPattern) {
-    uint32_t state = 1;
-    for (int round = 0; round < 500; round++) {
-        wire_bytes buckets;
-        int expected = 0;
-        while (buckets.size() < 32) {
-            state = state * 1664525 + 1013904223;
-            buckets.u8(round % 3 == 0 ? state >> 24 | state >> 16 : state >> 24);
-            expected += std::popcount(buckets.bytes.back());
-        }
-        ASSERT_EQ(decode(group, {hash_element(1, 1, buckets)}).list[0].buckets_assigned, expected);
-    }
-}
-
 TEST_F(ViewTest, EarlierBucketBitsStayWhereNoneAreAssigned) {
     wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES] = {};
     decoded[0] = {US, 100, 0, 1, 256, {0, 0, 0, 8}};
@@ -349,6 +253,13 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
         EXPECT_EQ(group->alarm_assign_sched, checks + 1);
     }
     EXPECT_EQ(group->redirecting_routers, 1);
+    // Neither: the elements say that a map should have come.
+    const wccp_assign_summary none = {};
+    log.take();
+    EXPECT_EQ(wccp_update_appliance_redirect_status(group, router(A), &none, &none), 1);
+    EXPECT_EQ(router(A)->self_buckets, 8);
+    EXPECT_TRUE(log.say("WCCP GRP 51: update redirect status: assign. info not found. sender rtr id: "
+                        "10.0.0.201"));
 }
 
 } // namespace
