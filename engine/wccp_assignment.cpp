@@ -27,17 +27,11 @@
 
 #include "engine/wccp_hash_assignment.h"
 #include "engine/wccp_mask_assignment.h"
+#include "engine/wccp_slot_owners.h"
 #include "engine/wccp_utils.h"
 #include "runtime/guards.h"
 
 static constexpr uint16_t FALLBACK_WEIGHT = 100;
-
-wccp_dsg_appliance *wccp_find_dsg_appliance(wccp_service_group *group, uint32_t count, be32 address) {
-    for (uint32_t i = 0; i < count; i++)
-        if (group->dsg_appliances[i].ipa == address)
-            return &group->dsg_appliances[i];
-    return nullptr;
-}
 
 void wccp_designated_appliance_assignment_start(wccp_service_group *group) {
     group->bucket_count = 0;

@@ -10,9 +10,6 @@ void wccp_designated_appliance_assignment_add(wccp_service_group *group,
 void wccp_designated_appliance_assignment_finish(wccp_service_group *group);
 void wccp_designated_appliance_assignment_cleanup(wccp_service_group *group);
 
-// The entry of an address among the first `count` of dsg_appliances, or null.
-wccp_dsg_appliance *wccp_find_dsg_appliance(wccp_service_group *group, uint32_t count, be32 address);
-
 // `table` holds address words as they lie in memory.
 void wccp_compute_assignment_table(uint32_t count, wccp_dsg_appliance *entries, uint32_t slots, be32 *table,
                                    uint32_t seed);

@@ -1,18 +1,18 @@
 // Mask assignment: the values that the group's mask spans, and which appliance serves each.
 //
 // A router ANDs fields of a packet with the mask and looks the result up among the values. Each bit that is
-// set in the mask is noted alone, in one fixed order over the fields, and value k is the sum of those bits
-// whose number is set in k; so 7 bits give 128 values, and a mask of 0 gives the one value 0. A mask with
-// more bits than that isn't used: four bits of the destination address stand in for it, in the assignment
-// only; what the group is configured with, and what a Here-I-Am tells, stays.
+// set in the mask is stored alone, in one fixed order over the fields, and value k is the sum of those bits
+// whose number is set in k. Thus 7 bits give 128 values, and a mask of 0 gives the one value 0. A mask with
+// more bits is not used: four bits of the destination address replace it, in the assignment only. The
+// configured mask stays, and Here-I-Am goes on sending it.
 //
-// Runs inside a computation of the table, under the engine lock: the values first, which then count as slots,
-// and their owners at the end. Masks and values are in host order.
+// Runs inside a computation of the table, under the engine lock: first the values, which then count as slots,
+// and at the end their owners. Masks and values are in host order.
 #include "engine/wccp_mask_assignment.h"
 
 #include <cstring>
 
-#include "engine/wccp_assignment.h"
+#include "engine/wccp_slot_owners.h"
 #include "engine/wccp_utils.h"
 
 static constexpr uint32_t DEFAULT_DST_IP_MASK = 0xF00;
@@ -92,17 +92,9 @@ int wccp_mask_assignment_assign_mask_values(wccp_service_group *group) {
                group->id, static_cast<int>(group->mask_value_count), static_cast<int>(group->bucket_count));
         return 1;
     }
-    for (uint32_t i = 0; i < group->dsg_active_count; i++)
-        group->dsg_appliances[i].assigned = 0;
-    wccp_dsg_appliance *owner = nullptr;
-    for (uint32_t i = 0; i < group->mask_value_count; i++) {
-        const be32 address = group->bucket_ipa[i];
-        group->mask_values[i].appliance_ipa = address;
-        if (i == 0 || !(address == group->bucket_ipa[i - 1])) // values come in runs
-            owner = wccp_find_dsg_appliance(group, group->dsg_active_count, address);
-        if (owner)
-            owner->assigned++;
-    }
+    for (uint32_t i = 0; i < group->mask_value_count; i++)
+        group->mask_values[i].appliance_ipa = group->bucket_ipa[i];
+    wccp_count_slots_by_owner(group, nullptr);
     const wccp_mask &mask = group->mask_in_use;
     QV_LOG(LC_LOG_INFO,
            "WCCP GRP %d: mask assign. values/appliance ids added. mask: sip 0x%x dip 0x%x sport 0x%x dport "

@@ -13,6 +13,7 @@
 #include <gtest/gtest.h>
 
 #include "engine/wccp_mask_assignment.h"
+#include "engine/wccp_slot_owners.h"
 #include "engine/wccp_utils.h"
 #include "tests/support/reported_group.h"
 
