@@ -17,8 +17,8 @@
 // only when no mention of it is left. An update that fails in the middle leaves the router's arrays as they
 // were, so that the next report is compared with the last complete one.
 //
-// The role of this appliance follows from what one router assigned before and assigns now: one table, at the
-// end of this file.
+// The role of this appliance follows from what one router assigned before and assigns now: take_redirection
+// at the end of this file.
 #include "engine/wccp_view_utils.h"
 
 #include <cstring>
@@ -349,70 +349,71 @@ int wccp_appliance_is_reported_by_all_senders(wccp_service_group *group, be32 ad
 
 // The role.
 
-namespace {
-
-enum wanted : uint8_t { ZERO, SOME, ANY };
-
-bool suits(wanted wanted_value, uint16_t value) {
-    return wanted_value == ANY || (wanted_value == SOME) == (value != 0);
+// Enters a state for the reason that `line` gives, with the group's number and the router's id.
+static void enter_state(wccp_service_group *group, const wccp_sending_router *router, const char *line,
+                        int (*enter)(wccp_service_group *)) {
+    QV_LOG(LC_LOG_INFO, line, group->id, addr_text(router->router_id).s);
+    enter(group);
 }
 
-// What a router assigns to this appliance and to anybody, now and before; what that does to the number of
-// routers that redirect here; under which further condition, tested after that, which line is logged and
-// which state entered. A change that suits a row but not its condition goes on to the next row that it suits,
-// and counts once.
-struct redirect_row {
-    wanted self_now, total_now, self_before, total_before;
-    int8_t routers;
-    bool (*condition)(wccp_service_group *group, const wccp_sending_router *router);
-    const char *line;
-    int (*enter)(wccp_service_group *group);
-};
-
-bool is_first_router(wccp_service_group *group, const wccp_sending_router *) {
-    return group->redirecting_routers == 1;
-}
-bool none_left(wccp_service_group *group, const wccp_sending_router *) {
-    return group->redirecting_routers == 0;
-}
-bool none_left_but_elsewhere(wccp_service_group *group, const wccp_sending_router *router) {
-    return group->redirecting_routers == 0 && wccp_any_routers_redirecting_to_other_appliances(group, router);
-}
-bool in_init(wccp_service_group *group, const wccp_sending_router *) {
-    return (group->state_flags & WCCP_STATE_INIT) != 0;
-}
-bool backup_to_nobody(wccp_service_group *group, const wccp_sending_router *router) {
-    return group->state_flags & WCCP_STATE_BACKUP &&
-           !wccp_any_routers_redirecting_to_other_appliances(group, router);
+static void router_redirects_here(wccp_service_group *group, const wccp_sending_router *router) {
+    if (++group->redirecting_routers == 1)
+        enter_state(group, router, "WCCP GRP %d: redirect: first router to self (router id %s )",
+                    wccp_appliance_state_active);
 }
 
-const redirect_row redirect_rows[] = {
-    {SOME, ANY, ZERO, ANY, +1, is_first_router, "WCCP GRP %d: redirect: first router to self (router id %s )",
-     wccp_appliance_state_active},
-    {ZERO, SOME, ANY, ZERO, 0, in_init,
-     "WCCP GRP %d: redirect: router id %s is redirecting to other  appliance(s).",
-     wccp_appliance_state_backup},
-    {ZERO, SOME, SOME, SOME, -1, none_left,
-     "WCCP GRP %d: redirect: last router stopped redirecting to self. (router id %s)",
-     wccp_appliance_state_backup},
-    {ZERO, ZERO, SOME, ANY, -1, none_left_but_elsewhere,
-     "WCCP GRP %d: redirect: this rtr (id %s) does not redirect. but another router does",
-     wccp_appliance_state_backup},
-    {ZERO, ZERO, SOME, ANY, -1, none_left,
-     "WCCP GRP %d: redirect: rtr does not redirect. no redirecting routers (router id %s)",
-     wccp_appliance_state_init},
-    {ZERO, ZERO, ZERO, SOME, 0, backup_to_nobody,
-     "WCCP GRP %d: redirect: no routers redirecting to group (router id %s)", wccp_appliance_state_init},
-};
+static void router_redirects_elsewhere(wccp_service_group *group, const wccp_sending_router *router) {
+    if (group->state_flags & WCCP_STATE_INIT)
+        enter_state(group, router,
+                    "WCCP GRP %d: redirect: router id %s is redirecting to other  appliance(s).",
+                    wccp_appliance_state_backup);
+}
 
-void count_router(wccp_service_group *group, int8_t change) {
-    if (change > 0)
-        group->redirecting_routers++;
-    else if (change < 0 && group->redirecting_routers != 0)
+// `elsewhere`: to other appliances, instead of to nobody.
+static void router_stopped_redirecting_here(wccp_service_group *group, const wccp_sending_router *router,
+                                            bool elsewhere) {
+    if (group->redirecting_routers != 0)
         group->redirecting_routers--;
+    if (group->redirecting_routers != 0)
+        return;
+    if (elsewhere)
+        enter_state(group, router,
+                    "WCCP GRP %d: redirect: last router stopped redirecting to self. (router id %s)",
+                    wccp_appliance_state_backup);
+    else if (wccp_any_routers_redirecting_to_other_appliances(group, router))
+        enter_state(group, router,
+                    "WCCP GRP %d: redirect: this rtr (id %s) does not redirect. but another router does",
+                    wccp_appliance_state_backup);
+    else
+        enter_state(group, router,
+                    "WCCP GRP %d: redirect: rtr does not redirect. no redirecting routers (router id %s)",
+                    wccp_appliance_state_init);
 }
 
-} // namespace
+static void router_stopped_redirecting_elsewhere(wccp_service_group *group,
+                                                 const wccp_sending_router *router) {
+    if (group->state_flags & WCCP_STATE_BACKUP &&
+        !wccp_any_routers_redirecting_to_other_appliances(group, router))
+        enter_state(group, router, "WCCP GRP %d: redirect: no routers redirecting to group (router id %s)",
+                    wccp_appliance_state_init);
+}
+
+// The router already holds what it assigns now; the numbers are what it assigned before, to this appliance
+// and to anybody, and at least one of them differs.
+static void take_redirection(wccp_service_group *group, const wccp_sending_router *router,
+                             uint16_t self_before, uint16_t total_before) {
+    const bool here = router->self_buckets != 0, anywhere = router->total_buckets != 0;
+    if (here) {
+        if (self_before == 0)
+            router_redirects_here(group, router);
+    } else if (anywhere && total_before == 0) {
+        router_redirects_elsewhere(group, router);
+    } else if (self_before != 0) {
+        router_stopped_redirecting_here(group, router, anywhere);
+    } else if (!anywhere) {
+        router_stopped_redirecting_elsewhere(group, router);
+    }
+}
 
 int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sending_router *router,
                                           const wccp_assign_summary *hash, const wccp_assign_summary *mask) {
@@ -432,19 +433,6 @@ int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sendin
     wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
     router->self_buckets = now->self_count;
     router->total_buckets = now->total_count;
-    bool counted = false;
-    for (const redirect_row &row : redirect_rows) {
-        if (!suits(row.self_now, now->self_count) || !suits(row.total_now, now->total_count) ||
-            !suits(row.self_before, self_before) || !suits(row.total_before, total_before))
-            continue;
-        if (!counted)
-            count_router(group, row.routers);
-        counted = true;
-        if (!row.condition(group, router))
-            continue;
-        QV_LOG(LC_LOG_INFO, row.line, group->id, addr_text(router->router_id).s);
-        row.enter(group);
-        return 0;
-    }
+    take_redirection(group, router, self_before, total_before);
     return 0;
 }
