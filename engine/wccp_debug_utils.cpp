@@ -149,10 +149,12 @@ static const group_row configured_rows[] = {
 };
 
 // One interface of a group, as its three rows take it.
+namespace {
 struct dump_interface {
     int number;
     const wccp_interface *interface;
 };
+} // namespace
 static const wccp_dump_row<dump_interface> interface_rows[] = {
     {"WCCP interfaces",
      [](wccp_piece *p, const dump_interface *i) {

@@ -1,5 +1,5 @@
 // The text dumps of the engine's state, into display buffers of the caller. Each entry point takes the engine
-// lock for the time that it reads, so a dump is one consistent picture. 0, or 1 when the text did not fit
+// lock for the time that it reads, so a dump is one consistent snapshot. 0, or 1 when the text did not fit
 // or there is no such group.
 #pragma once
 
