@@ -1,15 +1,15 @@
 // Service groups as configuration sees them: added, deleted, enabled, modified, started and stopped.
 //
 // Records: the wccp_service_group that hangs from wccp_g.groups, wccp_g.group_list and its interface's list.
-// Only the main thread adds and deletes groups, so a new record is built outside the engine lock and put in
-// place under it. Starting and stopping also happens on the notifier's thread, out of wccp_link_mgr.cpp, with
-// the lock held by the caller. Neither thread is ever cancelled: a group is never left half stopped.
+// Only the main thread adds and deletes groups, so a new record is built outside the engine lock and linked
+// under it. Groups are also started and stopped on the notifier's thread, by wccp_link_mgr.cpp, with the lock
+// held by the caller. Neither thread is ever cancelled: a group is never left half stopped.
 //
 // Nothing here keeps a pointer into the caller's wccp_grp_config.
 //
-// The farewell. A group that routers know leaves with one last Here-I-Am that carries the shutdown command.
-// It is sent under the lock while addresses, sockets and methods still are what the routers know; a group in
-// INIT has nothing to take back and says nothing, which makes a stop safe to repeat.
+// The shutdown message. A group that routers know sends one last Here-I-Am, which carries the shutdown
+// command. It is sent under the lock while addresses, sockets and methods are still those that the routers
+// know. A group in INIT has nothing to withdraw and sends none, which makes a stop safe to repeat.
 //
 // A multicast group on an interface without an address cannot join, and is reported as a failure although it
 // stays in the tables: the first address opens the sockets, joins, and starts it.
@@ -24,7 +24,7 @@
 #include <cstring>
 
 #include "engine/wccp_alarms.h"
-#include "engine/wccp_link_mgr.h"
+#include "engine/wccp_interface.h"
 #include "engine/wccp_network.h"
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_state.h"
@@ -35,11 +35,11 @@
 #include "runtime/list.h"
 #include "runtime/logging.h"
 
-static constexpr uint32_t HERE_I_AM_SECONDS = 10;
-static constexpr uint32_t MONITOR_SECONDS = 5;
-static constexpr uint8_t MCAST_TTL_FOR_ZERO = 33;
-
 namespace {
+
+constexpr uint32_t HERE_I_AM_SECONDS = 10;
+constexpr uint32_t MONITOR_SECONDS = 5;
+constexpr uint8_t MCAST_TTL_FOR_ZERO = 33;
 
 // Which update sets which bit of service_flags.
 struct hash_row {
@@ -103,10 +103,6 @@ void start_timer(wccp_timer *timer, uint32_t period, uint32_t countdown) {
         .active = 1, .mode = WCCP_TIMER_REPEATS, .remaining = 0, .period = period, .countdown = countdown};
 }
 
-bool is_ready(const wccp_interface *interface) {
-    return (interface->ready_flags & WCCP_ALL_READY) == WCCP_ALL_READY;
-}
-
 // What a group has agreed with its routers and computed for them.
 void forget_agreement(wccp_service_group *group) {
     group->designated = 0;
@@ -117,6 +113,15 @@ void forget_agreement(wccp_service_group *group) {
     group->state_flags = 0;
     wccp_clear_assignment_block(group);
     group->redirecting_routers = 0;
+}
+
+template <typename T>
+void free_list(T **head, uint32_t *count) {
+    while (T *record = *head) {
+        list_unlink(record);
+        wccp_free(record);
+    }
+    *count = 0;
 }
 
 void free_group(wccp_service_group *group) {
@@ -212,7 +217,7 @@ void wccp_start_service_group(wccp_service_group *group) {
         return;
     }
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 0);
-    if (!group->interfaces[0] || !is_ready(group->interfaces[0])) {
+    if (!wccp_if_is_ready(group->interfaces[0])) {
         QV_LOG(LC_LOG_NOTICE, "WCCP GRP %d: not launched (links are not ready)", group->id);
         return;
     }
@@ -243,15 +248,6 @@ void wccp_stop_service_group(wccp_service_group *group) {
     wccp_appliance_state_init(group);
 }
 
-template <typename T>
-static void free_list(T **head, uint32_t *count) {
-    while (T *record = *head) {
-        list_unlink(record);
-        wccp_free(record);
-    }
-    *count = 0;
-}
-
 int wccp_flush_group_lists(wccp_service_group *group) {
     for (wccp_sending_router *router = group->sending_routers; router; router = router->next)
         if (router->flags & WCCP_RTR_HAS_TUNNEL) {
@@ -265,16 +261,14 @@ int wccp_flush_group_lists(wccp_service_group *group) {
     return 0;
 }
 
+namespace {
+
 // Takes the group out of the engine and frees it. Lock held.
-static void delete_group(wccp_service_group *group, bool clear_alarms) {
+void delete_group(wccp_service_group *group, bool clear_alarms) {
     list_unlink(group);
     wccp_g.groups[group->id] = nullptr;
     wccp_notify_service_group_shutdown(group);
-    if (group->if_prev_link) {
-        *group->if_prev_link = group->if_next;
-        if (group->if_next)
-            group->if_next->if_prev_link = group->if_prev_link;
-    }
+    wccp_if_remove_group(group);
     wccp_flush_group_lists(group);
     wccp_set_role_and_send_event(group->id, WCCP_ROLE_UNKNOWN);
     if (clear_alarms)
@@ -282,6 +276,8 @@ static void delete_group(wccp_service_group *group, bool clear_alarms) {
     free_group(group);
     wccp_g.group_count--;
 }
+
+} // namespace
 
 int wccp_del_group(int id) {
     const wccp_engine_lock lock;
@@ -304,7 +300,9 @@ int wccp_del_all_groups() {
 
 // Changes of one field.
 
-static int wccp_enable_group(wccp_service_group *group, const wccp_grp_config *) {
+namespace {
+
+int wccp_enable_group(wccp_service_group *group, const wccp_grp_config *) {
     if (group->admin_state == WCCP_ADMIN_UP)
         return 0;
     group->admin_state = WCCP_ADMIN_UP;
@@ -312,7 +310,7 @@ static int wccp_enable_group(wccp_service_group *group, const wccp_grp_config *)
     return 0;
 }
 
-static int wccp_disable_group(wccp_service_group *group, const wccp_grp_config *) {
+int wccp_disable_group(wccp_service_group *group, const wccp_grp_config *) {
     if (group->admin_state != WCCP_ADMIN_UP)
         return 0;
     wccp_stop_service_group(group);
@@ -321,32 +319,32 @@ static int wccp_disable_group(wccp_service_group *group, const wccp_grp_config *
     return 0;
 }
 
-static int wccp_set_grp_weight(wccp_service_group *group, const wccp_grp_config *config) {
+int wccp_set_grp_weight(wccp_service_group *group, const wccp_grp_config *config) {
     group->weight = config->weight;
     return 0;
 }
 
-static int wccp_set_grp_password(wccp_service_group *group, const wccp_grp_config *config) {
+int wccp_set_grp_password(wccp_service_group *group, const wccp_grp_config *config) {
     set_password(group, config);
     return 0;
 }
 
-static int wccp_set_fwd_method(wccp_service_group *group, const wccp_grp_config *config) {
+int wccp_set_fwd_method(wccp_service_group *group, const wccp_grp_config *config) {
     group->cfg_fwd_method = config->fwd_method;
     return 0;
 }
 
-static int wccp_set_force_l2_rtn(wccp_service_group *group, const wccp_grp_config *config) {
+int wccp_set_force_l2_rtn(wccp_service_group *group, const wccp_grp_config *config) {
     group->force_l2_return = config->force_l2_return;
     return 0;
 }
 
-static int wccp_set_assign_method(wccp_service_group *group, const wccp_grp_config *config) {
+int wccp_set_assign_method(wccp_service_group *group, const wccp_grp_config *config) {
     group->cfg_assign_method = config->assign_method;
     return 0;
 }
 
-static int wccp_set_hash(wccp_service_group *group, const wccp_grp_config *config) {
+int wccp_set_hash(wccp_service_group *group, const wccp_grp_config *config) {
     for (const hash_row &row : hash_rows)
         if (config->config_flags == row.config_flag) {
             set_hash_bit(group, &row, config);
@@ -356,7 +354,7 @@ static int wccp_set_hash(wccp_service_group *group, const wccp_grp_config *confi
     return 1;
 }
 
-static int wccp_set_mask(wccp_service_group *group, const wccp_grp_config *config) {
+int wccp_set_mask(wccp_service_group *group, const wccp_grp_config *config) {
     if (!std::has_single_bit(config->config_flags)) {
         QV_LOG(LC_LOG_ERR, "wccp_set_mask: unknown config_flag 0x%x", config->config_flags);
         return 1;
@@ -365,12 +363,10 @@ static int wccp_set_mask(wccp_service_group *group, const wccp_grp_config *confi
     return 0;
 }
 
-static int wccp_set_compatibility_mode(wccp_service_group *group, const wccp_grp_config *config) {
+int wccp_set_compatibility_mode(wccp_service_group *group, const wccp_grp_config *config) {
     group->compat_mode = config->compatibility;
     return 0;
 }
-
-namespace {
 
 // What an update does, in the order in which its flags are looked at.
 struct modify_row {
@@ -446,7 +442,7 @@ int wccp_stop_all_service_groups() {
 
 void wccp_start_service_groups_by_interface(wccp_interface *interface) {
     interface->start_count++;
-    if (!is_ready(interface))
+    if (!wccp_if_is_ready(interface))
         return;
     for (wccp_service_group *group = interface->groups; group; group = group->if_next)
         if (group->admin_state == WCCP_ADMIN_UP)

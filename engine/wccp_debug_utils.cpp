@@ -168,10 +168,8 @@ static const wccp_dump_row<dump_interface> interface_rows[] = {
     {"WCCP interface ready flags",
      [](wccp_piece *p, const dump_interface *i) {
          const uint32_t flags = i->interface->ready_flags;
-         const wccp_interface *primary = wccp_g.primary_if;
-         const bool tracked = primary && (primary->ready_flags & WCCP_ALL_READY) == WCCP_ALL_READY;
          wccp_piece_add(p, "ipa: %s link: %s track intf: %s ", ok_or_no(flags & WCCP_IPA_READY),
-                        ok_or_no(flags & WCCP_LINK_READY), ok_or_no(tracked));
+                        ok_or_no(flags & WCCP_LINK_READY), ok_or_no(wccp_if_is_ready(wccp_g.primary_if)));
      }},
 };
 

@@ -1,21 +1,21 @@
-// The engine's one global record, its start and stop, and the bodies of its threads.
+// The engine's one global record, its start and stop, and the timer thread.
 //
-// Threads. "WCCP_TIMER" sleeps a second and runs a tick; it isn't made in bridge mode. One "WCCP_RX_..." for
-// each interface that ever had an address waits for a datagram without any lock and hands it over under the
-// engine lock. Both are ended by cancellation only, in a sleep, a wait, or right after they got the engine
-// lock (wccp_utils.cpp); whatever they hold there sits in guards, so that no lock goes along with them.
+// Threads. "WCCP_TIMER" sleeps a second and runs a tick; it is not created in bridge mode. One "WCCP_RX_..."
+// for each interface that ever had an address (wccp_network.cpp) waits for a datagram without any lock and
+// processes it under the engine lock. Both are ended by cancellation only: in a sleep, in a wait, or right
+// after they got the engine lock (wccp_utils.cpp). Whatever they hold there is in guards, so that no lock is
+// lost with them.
 //
-// Bridge mode. The stop of the groups and the cancellation of the threads are one step under the engine lock;
-// the lock is released before the threads are waited for, because any of them may be waiting for that very
-// lock. A thread that is woken by the release finds itself cancelled. Nothing here starts the threads again.
+// Bridge mode. Stopping the groups and cancelling the threads is one step under the engine lock. The lock is
+// released before the threads are joined, because any of them may be waiting for it; a thread that gets the
+// lock then finds itself cancelled. Nothing here starts the threads again.
 //
-// Exit. The groups go first, each with its farewell, then the threads. Notifications that come during the
-// exit are turned away at the door (wccp_link_mgr.cpp), so nobody makes a thread after they have been ended.
-// Datagrams are turned away as well: between the two steps there is no group that they could belong to, and
-// the mailbox has been reset.
+// Exit. The groups go first, each with its shutdown message, then the threads. Notifications and datagrams
+// that arrive during the exit are ignored: nobody creates a thread after all of them have been ended, and
+// between the two steps there is no group that a datagram could belong to, and the mailbox has been reset.
 //
-// The platform's notifier thread lives on until the process is gone. What its callbacks can reach, wccp_g
-// above all, is plain memory without a destructor.
+// The platform's notifier thread lives until the process is gone. What its callbacks can reach, wccp_g above
+// all, is plain memory without a destructor.
 //
 // wccp_g.track_primary stays 0: nothing of this appliance ties the groups to the primary interface, which is
 // a table entry like the others.
@@ -25,7 +25,6 @@
 #include <errno.h>
 #include <time.h>
 
-#include <cstdio>
 #include <cstring>
 #include <new>
 #include <type_traits>
@@ -34,8 +33,6 @@
 #include "engine/wccp_config.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_link_mgr.h"
-#include "engine/wccp_network.h"
-#include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_state.h"
 #include "engine/wccp_tunnel.h"
 #include "engine/wccp_utils.h"
@@ -43,13 +40,15 @@
 #include "platform/qvcommon.h"
 #include "runtime/logging.h"
 
-static constexpr uint8_t DEFAULT_MCAST_TTL = 5;
-
 // All zero, which is also the state of an unlocked mutex.
 constinit wccp_global wccp_g = {};
 static_assert(std::is_trivially_destructible_v<wccp_global>);
 
-static int start_timer_thread() {
+namespace {
+
+constexpr uint8_t DEFAULT_MCAST_TTL = 5;
+
+int start_timer_thread() {
     cthread *timer = cthread_init("WCCP_TIMER", wccp_timer_thread_fn, nullptr, nullptr, nullptr, 0, 0, 0, 0);
     if (timer && cthread_start(timer) == 0)
         return 0;
@@ -57,6 +56,8 @@ static int start_timer_thread() {
     QV_LOG(LC_LOG_ERR, "WCCP: Failed to spawn timer thread");
     return 1;
 }
+
+} // namespace
 
 int wccp_init_mgr() {
     QV_LOG(LC_LOG_INFO, "WCCP: Initialize WCCP manager");
@@ -91,13 +92,6 @@ int wccp_exit_mgr() {
     return 0;
 }
 
-int wccp_config_mcast(wccp_interface *interface) {
-    for (wccp_service_group *group = interface->groups; group; group = group->if_next)
-        if (group->mcast_configured)
-            wccp_join_mc_grp(interface, group->mcast_ipa);
-    return 0;
-}
-
 int wccp_system_mode_change_event(const char *mode) {
     if (!mode)
         return 1;
@@ -121,27 +115,6 @@ int wccp_init_network() {
     if (g_qvif_skfd < 0)
         qvif_network_init_sockets();
     return 0;
-}
-
-void *wccp_rx_thread_fn(void *argument) {
-    auto *interface = static_cast<wccp_interface *>(argument);
-    if (!interface) {
-        QV_LOG(LC_LOG_ERR, "WCCP: net init: launching RX thread failed. (bad interface)");
-        return nullptr;
-    }
-    QV_LOG(LC_LOG_INFO, "WCCP: %s: receive thread is running", interface->name);
-    for (;;) {
-        wccp_pkt pkt = {};
-        pkt.cursor = pkt.data;
-        const int32_t received = wccp_rx_pkt(interface, &pkt, sizeof pkt.data);
-        if (received < 1)
-            continue;
-        pkt.length = static_cast<uint32_t>(received);
-        const wccp_engine_lock lock;
-        if (wccpd_shutdown_in_progress() == 1)
-            continue;
-        wccp_process_received_packet(&pkt);
-    }
 }
 
 void wccp_tick() {

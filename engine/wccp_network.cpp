@@ -1,42 +1,23 @@
-// Sockets and packet I/O of the interfaces.
+// Set-up of the sockets of an interface, and its receive thread.
 //
 // Each interface owns a unicast socket, bound to its address, and a multicast socket, bound to the first
-// group address that is joined on it. They are opened and closed by the main thread and the notifier only,
-// neither of which is ever cancelled, with the engine lock held. Sending happens under the engine lock as
-// well, on whichever thread holds it. The interface's receive thread works without it.
+// group address that is joined on it. They are opened and closed with the engine lock held, by the main
+// thread and the notifier, neither of which is ever cancelled.
 //
-// The descriptor lock. A receive thread waits on numbers, and while it waits the number can be closed and
-// come back as another file: a socket of another interface, or the session with mgmtd. So the two cells of an
-// interface change under a small mutex, behind all others, and the receive thread takes that mutex twice: for
-// the numbers that it will wait on, and, once something is ready, to read its interface's number of that
-// moment, without blocking. What it reads therefore belongs to its interface; what its stale wait woke up for
-// may be nothing of its own, and then it reads nothing and comes again. It waits with no lock, for a second
-// at most, by poll, which takes descriptors of any size.
+// All groups of an interface send Here-I-Am in one tick, with the engine lock held, and their routers answer
+// at once: with 256 groups of 32 routers, some 8000 datagrams wait for the end of that tick. The kernel's
+// default buffer holds a few hundred; the rest would be lost at every tick, and routers would time out. A
+// larger limit costs memory only while datagrams are queued, and that memory is the kernel's.
 //
-// All groups of an interface say Here-I-Am in one tick, with the engine lock held, and their routers answer
-// at once: with 256 groups of 32 routers some 8000 datagrams wait for that tick to end. The kernel's usual
-// buffer holds a few hundred; the rest would be lost at every tick, and routers time out. What a larger
-// buffer may hold is the kernel's memory and is taken only while it is full.
-//
-// Sending never waits. A router that is gone from the network is looked for by the kernel for three seconds,
-// and what is sent to it meanwhile stays in the socket's send buffer: a few such routers in many groups fill
-// it, and a send that waited would stand still under the engine lock, with the tick and all that is received.
-// So that buffer is as large as the other one, and where it is full all the same the message is lost, as on
-// the way; the next one comes with its timer.
-//
-// A datagram that is longer than the buffer is cut to it, and the tail is gone: what is handed on has the
-// length of the buffer, and the check of the message's own length decides.
-//
-// A receive thread is made once for an interface and outlives its sockets. `rx_thread` only tells that it was
-// made: after the change to bridge mode the thread is gone, the cell stays, and so no second one is made.
+// A receive thread is created once for an interface and outlives its sockets. `rx_thread` only says that it
+// was created: after the change to bridge mode the thread is gone but the cell stays set, so that no second
+// one is created.
 
 #include "engine/wccp_network.h"
 
 #include <errno.h>
 #include <fcntl.h>
 #include <net/if.h>
-#include <netinet/in.h>
-#include <poll.h>
 #include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -45,50 +26,21 @@
 #include <cstring>
 
 #include "engine/cthread.h"
-#include "engine/wccp_mgr.h"
+#include "engine/wccp_host.h"
+#include "engine/wccp_packet_io.h"
+#include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_utils.h"
 #include "platform/qvcommon.h"
-#include "runtime/guards.h"
 #include "runtime/logging.h"
 
-static pthread_mutex_t descriptor_lock = PTHREAD_MUTEX_INITIALIZER;
+namespace {
 
-static constexpr int WAIT_MS = 1000;
-static constexpr int BUFFER = 16 << 20; // each way, bytes, the kernel's own records of the datagrams included
+constexpr int BUFFER = 16 << 20; // bytes in each direction, with the kernel's own overhead for each datagram
 
-static sockaddr_in socket_address(be32 address) {
-    sockaddr_in out = {};
-    out.sin_family = AF_INET;
-    out.sin_port = htons(WCCP_PORT);
-    out.sin_addr.s_addr = raw_word(address);
-    return out;
-}
-
-static int bind_to(int fd, be32 address) {
-    const sockaddr_in local = socket_address(address);
+int bind_to(int fd, be32 address) {
+    const sockaddr_in local = wccp_socket_address(address);
     return bind(fd, reinterpret_cast<const sockaddr *>(&local), sizeof local);
 }
-
-static void set_descriptor(int32_t *cell, int fd) {
-    const mutex_guard guard(&descriptor_lock);
-    *cell = fd;
-}
-
-static void close_descriptor(int32_t *cell) {
-    const mutex_guard guard(&descriptor_lock);
-    if (*cell > 0)
-        close(*cell);
-    *cell = -1;
-}
-
-void wccp_close_sockets(wccp_interface *interface) {
-    close_descriptor(&interface->ucast_fd);
-    close_descriptor(&interface->mcast_fd);
-    interface->ucast_bound = 0;
-    interface->mcast_bound = 0;
-}
-
-namespace {
 
 struct socket_option {
     int level, name;
@@ -97,18 +49,16 @@ struct socket_option {
     const char *failure; // with the interface's name
 };
 
-} // namespace
-
-// As large as the kernel gives it.
-static void widen_buffer(int fd, int forced, int within_limits) {
+// As large as the kernel allows.
+void widen_buffer(int fd, int forced, int within_limits) {
     if (setsockopt(fd, SOL_SOCKET, forced, &BUFFER, sizeof BUFFER) != 0)
         (void)setsockopt(fd, SOL_SOCKET, within_limits, &BUFFER, sizeof BUFFER);
 }
 
-// A datagram socket with these options, or -1; each failure has its line.
+// A datagram socket with these options, or -1; each failure has its log line.
 template <size_t Count>
-static int open_socket(const wccp_interface *interface, const char *open_failure,
-                       const socket_option (&options)[Count]) {
+int open_socket(const wccp_interface *interface, const char *open_failure,
+                const socket_option (&options)[Count]) {
     const int fd = socket(AF_INET, SOCK_DGRAM, 0);
     if (fd < 0) {
         QV_LOG(LC_LOG_ERR, open_failure, interface->name);
@@ -127,7 +77,7 @@ static int open_socket(const wccp_interface *interface, const char *open_failure
     return fd;
 }
 
-static int open_unicast(wccp_interface *interface) {
+int open_unicast(wccp_interface *interface) {
     const int on = 1, no_discovery = IP_PMTUDISC_DONT;
     const socket_option options[] = {
         {SOL_SOCKET, SO_REUSEADDR, &on, sizeof on, "WCCP: net init %s: Cannot set mcast socket option: %m"},
@@ -137,19 +87,19 @@ static int open_unicast(wccp_interface *interface) {
     const int fd = open_socket(interface, "WCCP: net init %s: Fail to open ucast socket. %m", options);
     if (fd < 0)
         return 1;
-    // A socket that cannot be bound stays open: it is `ucast_bound` that allows sending.
+    // A socket that cannot be bound stays open; it is `ucast_bound` that permits sending.
     const int result = bind_to(fd, interface->ipa);
     if (result != 0)
         QV_LOG(LC_LOG_ERR, "WCCP: net init: %s Cannot bind unicast UDP socket to %s:%d: %m", interface->name,
                addr_text(interface->ipa).s, WCCP_PORT);
-    set_descriptor(&interface->ucast_fd, fd);
+    wccp_set_descriptor(&interface->ucast_fd, fd);
     if (result != 0)
         return 1;
     interface->ucast_bound = 1;
     return 0;
 }
 
-static int open_multicast(wccp_interface *interface) {
+int open_multicast(wccp_interface *interface) {
     const int on = 1, no_discovery = IP_PMTUDISC_DONT;
     const uint8_t ttl = wccp_g.mcast_ttl, no_loop = 0;
     const socket_option options[] = {
@@ -163,7 +113,7 @@ static int open_multicast(wccp_interface *interface) {
     const int fd = open_socket(interface, "WCCP: net init %s: Cannot open mc socket. %m", options);
     if (fd < 0)
         return 1;
-    set_descriptor(&interface->mcast_fd, fd);
+    wccp_set_descriptor(&interface->mcast_fd, fd);
     if (setsockopt(fd, IPPROTO_IP, IP_MULTICAST_IF, &interface->ipa, sizeof interface->ipa) != 0) {
         QV_LOG(LC_LOG_ERR, "WCCP: net init %s: Cannot set mcast output interface to: %s. %m", interface->name,
                addr_text(interface->ipa).s);
@@ -172,7 +122,7 @@ static int open_multicast(wccp_interface *interface) {
     return 0;
 }
 
-static int start_rx_thread(wccp_interface *interface) {
+int start_rx_thread(wccp_interface *interface) {
     if (interface->rx_thread) {
         QV_LOG(LC_LOG_INFO, "WCCP: net init %s: receive thread is running already", interface->name);
         return 0;
@@ -187,6 +137,36 @@ static int start_rx_thread(wccp_interface *interface) {
     }
     interface->rx_thread = thread;
     return 0;
+}
+
+ifreq request_for(const char *name) {
+    ifreq request = {};
+    strlcpy(request.ifr_name, name, sizeof request.ifr_name);
+    request.ifr_addr.sa_family = AF_INET;
+    return request;
+}
+
+} // namespace
+
+void *wccp_rx_thread_fn(void *argument) {
+    auto *interface = static_cast<wccp_interface *>(argument);
+    if (!interface) {
+        QV_LOG(LC_LOG_ERR, "WCCP: net init: launching RX thread failed. (bad interface)");
+        return nullptr;
+    }
+    QV_LOG(LC_LOG_INFO, "WCCP: %s: receive thread is running", interface->name);
+    for (;;) {
+        wccp_pkt pkt = {};
+        pkt.cursor = pkt.data;
+        const int32_t received = wccp_rx_pkt(interface, &pkt, sizeof pkt.data);
+        if (received < 1)
+            continue;
+        pkt.length = static_cast<uint32_t>(received);
+        const wccp_engine_lock lock;
+        if (wccpd_shutdown_in_progress() == 1)
+            continue;
+        wccp_process_received_packet(&pkt);
+    }
 }
 
 int wccp_init_network_by_interface(wccp_interface *interface) {
@@ -230,77 +210,11 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
     return 1;
 }
 
-static int32_t send_to(int fd, const wccp_pkt *pkt, be32 address) {
-    const sockaddr_in to = socket_address(address);
-    return static_cast<int32_t>(
-        sendto(fd, pkt->data, pkt->length, 0, reinterpret_cast<const sockaddr *>(&to), sizeof to));
-}
-
-int32_t wccp_tx_pkt(wccp_service_group *group, wccp_pkt *pkt) {
-    if (!group || !pkt) {
-        QV_LOG(LC_LOG_ERR, "WCCP: group or pkt is NULL");
-        return 0;
-    }
-    const wccp_interface *interface = group->interfaces[0];
-    if (!interface) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: transmit: interface is not set", group->id);
-        return 0;
-    }
-    if (!interface->ucast_bound)
-        return 0;
-    if (!is_zero(pkt->ipa))
-        return send_to(interface->ucast_fd, pkt, pkt->ipa);
-    if (group->mcast_configured) {
-        pkt->ipa = group->mcast_ipa;
-        return send_to(interface->mcast_fd, pkt, pkt->ipa);
-    }
-    int32_t sum = 0;
-    for (uint32_t i = 0; i < group->ucast_router_count; i++) {
-        pkt->ipa = group->ucast_routers[i];
-        sum += send_to(interface->ucast_fd, pkt, pkt->ipa);
-    }
-    return sum;
-}
-
-int32_t wccp_rx_pkt(wccp_interface *interface, wccp_pkt *pkt, uint32_t length) {
-    enum { MCAST, UCAST };
-    pollfd ready[2] = {};
-    {
-        const mutex_guard guard(&descriptor_lock);
-        ready[MCAST] = {.fd = interface->mcast_fd, .events = POLLIN, .revents = 0};
-        ready[UCAST] = {.fd = interface->ucast_fd, .events = POLLIN, .revents = 0};
-    }
-    if (ready[MCAST].fd == -1 && ready[UCAST].fd == -1) {
-        sleep(1);
-        return 0;
-    }
-    if (poll(ready, 2, WAIT_MS) < 1)
-        return 0;
-
-    sockaddr_in from = {};
-    socklen_t from_length = sizeof from;
-    ssize_t received;
-    {
-        const mutex_guard guard(&descriptor_lock);
-        const int fd = ready[MCAST].revents ? interface->mcast_fd : interface->ucast_fd;
-        if (fd == -1)
-            return 0;
-        received =
-            recvfrom(fd, pkt->data, length, MSG_DONTWAIT, reinterpret_cast<sockaddr *>(&from), &from_length);
-    }
-    if (received < 1)
-        return static_cast<int32_t>(received);
-    pkt->ipa = from_raw_word(from.sin_addr.s_addr);
-    QV_LOG(LC_LOG_INFO, "WCCP %-6s: Rx %d bytes from %s", interface->name, static_cast<int>(received),
-           addr_text(pkt->ipa).s);
-    return static_cast<int32_t>(received);
-}
-
-static ifreq request_for(const char *name) {
-    ifreq request = {};
-    strlcpy(request.ifr_name, name, sizeof request.ifr_name);
-    request.ifr_addr.sa_family = AF_INET;
-    return request;
+int wccp_config_mcast(wccp_interface *interface) {
+    for (wccp_service_group *group = interface->groups; group; group = group->if_next)
+        if (group->mcast_configured)
+            wccp_join_mc_grp(interface, group->mcast_ipa);
+    return 0;
 }
 
 be32 wccp_get_address(const char *name) {

@@ -20,7 +20,7 @@
 
 #include <cstring>
 
-#include "engine/wccp_network.h"
+#include "engine/wccp_packet_io.h"
 #include "engine/wccp_pkt_load.h"
 #include "engine/wccp_pkt_unload.h"
 #include "engine/wccp_router_utils.h"
@@ -473,7 +473,7 @@ int wccp_transmit_packet(wccp_service_group *group, wccp_pkt *pkt, uint32_t numb
         return 1;
     }
     const wccp_interface *interface = group->interfaces[0];
-    if (!interface || (interface->ready_flags & WCCP_ALL_READY) != WCCP_ALL_READY) {
+    if (!wccp_if_is_ready(interface)) {
         group->tx_link_drops++;
         return 0;
     }

@@ -2,11 +2,11 @@
 //
 // The engine lock is taken by the timer thread for a tick, by a receive thread for a packet, by the main
 // thread for each call of configuration and monitoring, and by the platform's notifier for a callback.
-// Waiting for a mutex is no cancellation point, so a receive thread that waits while the engine is being
-// stopped gets the lock afterwards, with its cancellation still to come. It would put new routers into groups
-// that have been stopped, and commands to tunneld behind them. So the first thing done under the lock is to
-// ask for that cancellation: the thread ends there, a guard lets go of the lock on the way, and nothing has
-// been touched. The main thread and the notifier are never cancelled and never notice.
+// Waiting for a mutex is not a cancellation point: a receive thread that waits while the engine is stopped
+// gets the lock afterwards, with its cancellation still pending. It would then add routers to groups that
+// have been stopped, and send commands to tunneld. Whoever takes the lock therefore first acts on a pending
+// cancellation; the thread ends there, a guard releases the lock, and nothing has been touched. The main
+// thread and the notifier are never cancelled.
 
 #include "engine/wccp_utils.h"
 
@@ -18,22 +18,14 @@
 
 #include "runtime/guards.h"
 
-wccp_engine_lock::wccp_engine_lock() : held(false) {
-    // The object is not complete here: if the thread ends, this guard is what unwinds.
+wccp_engine_lock::wccp_engine_lock() {
+    // The object is not complete yet: if the thread ends here, this guard releases the lock.
     mutex_guard guard(&wccp_g.lock);
     pthread_testcancel();
     guard.held = nullptr;
-    held = true;
 }
 
 wccp_engine_lock::~wccp_engine_lock() {
-    release();
-}
-
-void wccp_engine_lock::release() {
-    if (!held)
-        return;
-    held = false;
     pthread_mutex_unlock(&wccp_g.lock);
 }
 
@@ -70,7 +62,13 @@ wccp_service_group *wccp_find_group(int id) {
     return wccp_g.groups[id & 0xff];
 }
 
-static void *counted_calloc(const char *function, uint32_t count, uint32_t size) {
+bool wccp_if_is_ready(const wccp_interface *interface) {
+    return interface && (interface->ready_flags & WCCP_ALL_READY) == WCCP_ALL_READY;
+}
+
+namespace {
+
+void *counted_calloc(const char *function, uint32_t count, uint32_t size) {
     void *memory = calloc(count, size);
     if (memory) {
         wccp_g.stat_allocs.fetch_add(1, std::memory_order_relaxed);
@@ -81,6 +79,8 @@ static void *counted_calloc(const char *function, uint32_t count, uint32_t size)
            static_cast<int>(count * size));
     return nullptr;
 }
+
+} // namespace
 
 void *wccp_calloc(uint32_t count, uint32_t size) {
     return counted_calloc("wccp_calloc", count, size);

@@ -9,6 +9,9 @@
 // The group with this id, or null. Lock held; only the low 8 bits count.
 wccp_service_group *wccp_find_group(int id);
 
+// Whether the interface has a link and an address; false for null. Lock held.
+bool wccp_if_is_ready(const wccp_interface *interface);
+
 // Zeroed memory, or null with an error line; counted in wccp_g. For free() use wccp_free, which takes null.
 void *wccp_calloc(uint32_t count, uint32_t size);
 void *wccp_malloc(uint32_t size);
@@ -33,13 +36,12 @@ const char *wccp_assign_method_name(uint32_t code);
 // Number of 1 bits over the four fields, 0 for null.
 uint32_t util_wccp_mask_get_bits_set(const wccp_mask *mask);
 
-// The engine lock for a scope. Once it has the lock it looks whether its thread has been cancelled meanwhile
-// and ends there: a thread that waited through the stop of the engine never touches what was stopped.
+// The engine lock for a scope. Once it has the lock it checks whether its thread has been cancelled
+// meanwhile, and ends the thread there: a thread that waited while the engine was stopped never touches what
+// was stopped.
 struct wccp_engine_lock {
     wccp_engine_lock();
     ~wccp_engine_lock();
     wccp_engine_lock(const wccp_engine_lock &) = delete;
     wccp_engine_lock &operator=(const wccp_engine_lock &) = delete;
-    void release();
-    bool held;
 };

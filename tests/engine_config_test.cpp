@@ -9,6 +9,7 @@
 #include <cstring>
 #include <string>
 
+#include "engine/wccp_interface.h"
 #include "engine/wccp_link_mgr.h"
 #include "engine/wccp_utils.h"
 #include "runtime/common.h"

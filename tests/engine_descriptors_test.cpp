@@ -12,6 +12,7 @@
 #include <unistd.h>
 
 #include "engine/wccp_network.h"
+#include "engine/wccp_packet_io.h"
 #include "tests/support/engine_fixture.h"
 
 static std::function<void()> after_wait; // once, when something is ready

@@ -3,6 +3,7 @@
 // given by hand in every order that the kernel may choose.
 
 #include "engine/wccp_network.h"
+#include "engine/wccp_packet_io.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -21,6 +22,7 @@
 #include "engine/cthread.h"
 #include "engine/wccp_config.h"
 #include "engine/wccp_host.h"
+#include "engine/wccp_interface.h"
 #include "engine/wccp_link_mgr.h"
 #include "engine/wccp_mgr.h"
 #include "platform/limits.h"
@@ -397,7 +399,8 @@ TEST_F(Network, AddressAndLinkInEitherOrderEndInReady) {
     }
 }
 
-// Deleted and made again while the notifier waited: what it reads when it gets the lock is the old address.
+// Deleted and made again while the notifier waited: what it reads when it gets the lock is the old
+// address.
 TEST_F(Network, AnInterfaceMadeAgainWithItsAddressIsJoinedAgain) {
     live_group({"224.0.1.61"});
     ASSERT_EQ(wan->mcast_bound, 1u);

@@ -1,0 +1,132 @@
+// Packet I/O of the interfaces.
+//
+// Descriptors are written with the engine lock held. Sending also happens under the engine lock, on whichever
+// thread holds it. The receive thread of an interface works without it.
+//
+// The descriptor lock. A receive thread waits on descriptor numbers. While it waits, a number can be closed
+// and reused for another file: a socket of another interface, or the session with mgmtd. The two cells of an
+// interface therefore change under a small mutex, taken after all others, and the receive thread takes that
+// mutex twice: to copy the numbers that it waits on, and, once something is ready, to read from the number
+// that its interface has by then, without blocking. What it reads always belongs to its interface. After a
+// wakeup for a number that has changed hands it finds nothing and waits again. It waits with poll, which
+// takes descriptors of any size, holding no lock and for a second at most.
+//
+// Sending never waits. The kernel resolves the address of a router that has left the network for three
+// seconds, and datagrams for it stay in the socket's send buffer meanwhile; a few such routers in many groups
+// fill it. A send that waited then would block the engine lock, and with it the tick and all reception. The
+// buffer is large, and a message that finds it full is lost as it would be in the network; the next one
+// follows with its timer.
+//
+// A datagram that is longer than the receive buffer is cut. The length passed on is the length of the buffer,
+// and the check of the message's own length refuses it.
+
+#include "engine/wccp_packet_io.h"
+
+#include <poll.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include "engine/wccp_utils.h"
+#include "runtime/guards.h"
+#include "runtime/logging.h"
+
+namespace {
+
+constexpr int WAIT_MS = 1000;
+
+pthread_mutex_t descriptor_lock = PTHREAD_MUTEX_INITIALIZER;
+
+void close_descriptor(int32_t *cell) {
+    const mutex_guard guard(&descriptor_lock);
+    if (*cell > 0)
+        close(*cell);
+    *cell = -1;
+}
+
+int32_t send_to(int fd, const wccp_pkt *pkt, be32 address) {
+    const sockaddr_in to = wccp_socket_address(address);
+    return static_cast<int32_t>(
+        sendto(fd, pkt->data, pkt->length, 0, reinterpret_cast<const sockaddr *>(&to), sizeof to));
+}
+
+} // namespace
+
+sockaddr_in wccp_socket_address(be32 address) {
+    sockaddr_in out = {};
+    out.sin_family = AF_INET;
+    out.sin_port = htons(WCCP_PORT);
+    out.sin_addr.s_addr = raw_word(address);
+    return out;
+}
+
+void wccp_set_descriptor(int32_t *cell, int fd) {
+    const mutex_guard guard(&descriptor_lock);
+    *cell = fd;
+}
+
+void wccp_close_sockets(wccp_interface *interface) {
+    close_descriptor(&interface->ucast_fd);
+    close_descriptor(&interface->mcast_fd);
+    interface->ucast_bound = 0;
+    interface->mcast_bound = 0;
+}
+
+int32_t wccp_tx_pkt(wccp_service_group *group, wccp_pkt *pkt) {
+    if (!group || !pkt) {
+        QV_LOG(LC_LOG_ERR, "WCCP: group or pkt is NULL");
+        return 0;
+    }
+    const wccp_interface *interface = group->interfaces[0];
+    if (!interface) {
+        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: transmit: interface is not set", group->id);
+        return 0;
+    }
+    if (!interface->ucast_bound)
+        return 0;
+    if (!is_zero(pkt->ipa))
+        return send_to(interface->ucast_fd, pkt, pkt->ipa);
+    if (group->mcast_configured) {
+        pkt->ipa = group->mcast_ipa;
+        return send_to(interface->mcast_fd, pkt, pkt->ipa);
+    }
+    int32_t sum = 0;
+    for (uint32_t i = 0; i < group->ucast_router_count; i++) {
+        pkt->ipa = group->ucast_routers[i];
+        sum += send_to(interface->ucast_fd, pkt, pkt->ipa);
+    }
+    return sum;
+}
+
+int32_t wccp_rx_pkt(wccp_interface *interface, wccp_pkt *pkt, uint32_t length) {
+    enum { MCAST, UCAST };
+    pollfd ready[2] = {};
+    {
+        const mutex_guard guard(&descriptor_lock);
+        ready[MCAST] = {.fd = interface->mcast_fd, .events = POLLIN, .revents = 0};
+        ready[UCAST] = {.fd = interface->ucast_fd, .events = POLLIN, .revents = 0};
+    }
+    if (ready[MCAST].fd == -1 && ready[UCAST].fd == -1) {
+        sleep(1);
+        return 0;
+    }
+    if (poll(ready, 2, WAIT_MS) < 1)
+        return 0;
+
+    sockaddr_in from = {};
+    socklen_t from_length = sizeof from;
+    ssize_t received;
+    {
+        const mutex_guard guard(&descriptor_lock);
+        const int fd = ready[MCAST].revents ? interface->mcast_fd : interface->ucast_fd;
+        if (fd == -1)
+            return 0;
+        received =
+            recvfrom(fd, pkt->data, length, MSG_DONTWAIT, reinterpret_cast<sockaddr *>(&from), &from_length);
+    }
+    if (received < 1)
+        return static_cast<int32_t>(received);
+    pkt->ipa = from_raw_word(from.sin_addr.s_addr);
+    QV_LOG(LC_LOG_INFO, "WCCP %-6s: Rx %d bytes from %s", interface->name, static_cast<int>(received),
+           addr_text(pkt->ipa).s);
+    return static_cast<int32_t>(received);
+}
