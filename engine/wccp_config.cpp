@@ -210,6 +210,8 @@ int wccp_add_group(const wccp_grp_config *config) {
 }
 
 void wccp_start_service_group(wccp_service_group *group) {
+    group->assign_timer.active = 0;
+    wccp_flush_group_lists(group);
     forget_agreement(group);
     wccp_appliance_state_init(group);
     if (group->admin_state != WCCP_ADMIN_UP) {

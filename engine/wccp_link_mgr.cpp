@@ -66,8 +66,11 @@ void wccp_deinit_link_mgr() {
 }
 
 void wccp_link_update_group_ipa(wccp_service_group *first, be32 ipa) {
-    for (wccp_service_group *group = first; group; group = group->if_next)
+    for (wccp_service_group *group = first; group; group = group->if_next) {
+        if (group->appliance_ipa != ipa)
+            wccp_flush_group_lists(group); // its tunnel references are found by the old address
         group->appliance_ipa = ipa;
+    }
 }
 
 void wccp_process_if_state_change(const void *argument) {

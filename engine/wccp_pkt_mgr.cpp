@@ -327,6 +327,11 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: is disabled. dropping the rxed packet.", group->id);
         return 0;
     }
+    // Queued in the socket, or held by the receive thread, while the group was stopped.
+    if (!wccp_group_is_running(group)) {
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: is not running. dropping the rxed packet.", group->id);
+        return 0;
+    }
     if (!passes_security(group, pkt, security, digest)) {
         group->rx_failures++;
         return refuse(pkt);

@@ -66,6 +66,11 @@ bool wccp_if_is_ready(const wccp_interface *interface) {
     return interface && (interface->ready_flags & WCCP_ALL_READY) == WCCP_ALL_READY;
 }
 
+// The Here-I-Am timer runs from the start of a group to its stop.
+bool wccp_group_is_running(const wccp_service_group *group) {
+    return group->hia_timer.active == 1 && wccp_if_is_ready(group->interfaces[0]);
+}
+
 namespace {
 
 void *counted_calloc(const char *function, uint32_t count, uint32_t size) {

@@ -11,6 +11,8 @@ wccp_service_group *wccp_find_group(int id);
 
 // Whether the interface has a link and an address; false for null. Lock held.
 bool wccp_if_is_ready(const wccp_interface *interface);
+// Whether the group has been started, on an interface that is ready, and not stopped since. Lock held.
+bool wccp_group_is_running(const wccp_service_group *group);
 
 // Zeroed memory, or null with an error line; counted in wccp_g. For free() use wccp_free, which takes null.
 void *wccp_calloc(uint32_t count, uint32_t size);

@@ -12,6 +12,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstring>
+#include <functional>
 #include <optional>
 #include <string>
 #include <thread>
@@ -23,7 +24,8 @@
 #include "engine/wccp_link_mgr.h"
 #include "engine/wccp_mgr.h"
 #include "engine/wccp_network.h"
-#include "engine/wccp_packet_io.h"
+#include "engine/wccp_pkt_mgr.h"
+#include "engine/wccp_router_utils.h"
 #include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"
 #include "runtime/common.h"
@@ -56,8 +58,9 @@ bool lock_is_free() {
 
 enum method { GRE = 1, L2 = 2 }; // a router of the first kind needs a tunnel
 
-// Sends the I-See-You of a router that sees this appliance: no security, hash, no assignment yet.
-void see_you(int fd, uint8_t id, const std::string &router, const std::string &appliance, method way = GRE) {
+// The I-See-You of a router that sees this appliance: no security, hash, no assignment yet.
+std::vector<uint8_t> i_see_you(uint8_t id, const std::string &router, const std::string &appliance,
+                               method way = GRE) {
     const uint32_t from = ntohl(address_word(router)), to = ntohl(address_word(appliance));
     wire_bytes security, service, identity, view, capabilities;
     security.hex("0000 0004 00000000");
@@ -65,7 +68,10 @@ void see_you(int fd, uint8_t id, const std::string &router, const std::string &a
     identity.hex("0002 0014").u32(from).u32(1).u32(to).u32(1).u32(to);
     view.hex("0004 0044 00000001 00000000 00000000 00000001").u32(from).u32(1).u32(to).zeros(40);
     capabilities.hex("0008 0018 0001 0004").u32(way).hex("0002 0004 00000001 0003 0004").u32(way);
-    send_datagram(fd, appliance, 2048, wire_message(11, {security, service, identity, view, capabilities}));
+    return wire_message(11, {security, service, identity, view, capabilities});
+}
+void see_you(int fd, uint8_t id, const std::string &router, const std::string &appliance, method way = GRE) {
+    send_datagram(fd, appliance, 2048, i_see_you(id, router, appliance, way));
 }
 
 class Threads : public testing::Test {
@@ -234,6 +240,65 @@ TEST_F(Threads, NotificationsAndADatagramThatComeThroughAnExit) {
     EXPECT_TRUE(wan->ipa_change_count == 0 && wan->link_down_count == 0);
     EXPECT_EQ(threads_named("WCCP_"), 0);
     EXPECT_EQ(wan->ucast_fd, -1);
+}
+
+// Link or address is gone, and the group stopped with it. A packet that was queued before must not make a
+// router known again: after the next start that router would never agree on methods.
+TEST_F(Threads, APacketBetweenStopAndStartChangesNothing) {
+    wccp_service_group *group = add_group(61, "wan0");
+    const auto process = [] {
+        const wccp_engine_lock lock;
+        return wccp_process_received_packet(
+            make_received(i_see_you(61, "10.1.0.2", "10.1.0.1"), ipa("10.1.0.2")).get());
+    };
+    const auto joins = [&] {
+        EXPECT_EQ(process(), 0);
+        EXPECT_EQ(group->sending_router_count, 1u);
+        EXPECT_EQ(group->fwd_method, WCCP_METHOD_GRE + 0u);
+        EXPECT_TRUE(group->state_flags & WCCP_CAPABILITIES_SET);
+        const std::vector<seen_command> seen = tunneld->take_commands();
+        return seen.size() == 1 && seen[0].code == MAILBOX_ADD_TUNNEL && seen[0].local == 0x0a010001;
+    };
+    const struct {
+        const char *gone;
+        std::function<void(bool)> link_or_address;
+    } ways[] = {{"link",
+                 [](bool up) {
+                     const qv_if_state_info info = {"wan0", up, up};
+                     wccp_process_if_state_change(&info);
+                 }},
+                {"address", [](bool up) {
+                     run_command(std::string("ip addr ") + (up ? "add" : "del") + " 10.1.0.1/24 dev wan0");
+                     wccp_process_if_ipa_update("wan0");
+                 }}};
+    (void)tunneld->take_commands(); // the L2 return of the start
+    for (const auto &way : ways) {
+        SCOPED_TRACE(way.gone);
+        EXPECT_TRUE(joins());
+        way.link_or_address(false);
+        (void)tunneld->take_commands(); // the delete
+        const uint32_t icus = group->rx_icus;
+        EXPECT_EQ(process(), 0);
+        EXPECT_EQ(group->rx_icus, icus);
+        EXPECT_EQ(group->sending_router_count, 0u);
+        EXPECT_EQ(group->state_flags, WCCP_STATE_INIT);
+        EXPECT_TRUE(tunneld->take_commands().empty());
+
+        // A router that is known all the same goes with the next start, and so does its tunnel from an
+        // address that the group has no more.
+        const wccp_rtr_capabilities gre = {WCCP_METHOD_GRE, WCCP_ASSIGN_HASH, WCCP_METHOD_GRE};
+        const be32 old_address = group->appliance_ipa;
+        ASSERT_NE(wccp_create_sending_router(group, ipa("10.1.0.2"), &gre, &gre), nullptr);
+        group->assign_timer.active = 1;
+        (void)tunneld->take_commands();
+        way.link_or_address(true);
+        EXPECT_EQ(group->sending_router_count + group->assign_timer.active, 0u);
+        const std::vector<seen_command> seen = tunneld->take_commands();
+        ASSERT_EQ(seen.size(), 2u); // and the L2 return
+        EXPECT_EQ(seen[0].code, MAILBOX_DELETE_TUNNEL);
+        EXPECT_EQ(seen[0].local, to_host(old_address));
+    }
+    EXPECT_TRUE(joins());
 }
 
 std::atomic<int> signals_taken;
