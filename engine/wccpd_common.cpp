@@ -1,34 +1,30 @@
-// wccpd's side of the mailbox to tunneld, and the policy groups whose roles it publishes there.
+// wccpd's side of the mailbox to tunneld.
 //
-// The mailbox. One mutex, behind every other lock of the engine and in front of none, keeps commands apart:
-// it is held from the first input to the end of the wait, so two commands never overlap, whichever of the
-// engine's locks their callers hold. `command` is taken to 0 before an input is touched, because a delete or
-// an L2 return that timed out is still pending and tunneld may be reading it; it is written last, with
-// release order, and the answer is looked for with acquire order.
+// Only the process that created the block writes to it. A second wccpd, whose creation was refused, knows no
+// mailbox: its commands fail at once, it publishes no role, and its exit resets nothing.
 //
-// The wait is a poll of one millisecond, two thousand times. Between two polls, once there is no answer yet,
-// it is a cancellation point: an answer that has come is taken, and a thread cancelled before lets go of the
-// mutex on its way out and withdraws an add, as after a time-out, since nobody would know the tunnel that
-// came of it.
+// One mutex, behind every other lock of the engine and before none, keeps commands apart: it is held from the
+// first input to the end of the wait. Therefore two commands never overlap, whichever of the engine's locks
+// their callers hold. `command` is set to 0 before an input is touched, because a delete or an L2 return that
+// timed out is still pending and tunneld may be reading it; it is written last, with release order, and the
+// answer is looked for with acquire order.
 //
-// The reset at exit runs on the main thread while an engine thread may be waiting. It raises `abandon`, which
+// The wait is a poll of one millisecond, two thousand times. Between two polls, when there is no answer yet,
+// it is a cancellation point: an answer that has come is taken, and a thread that is cancelled before
+// releases the mutex on its way out and withdraws an add, as after a time-out, since nobody would know the
+// tunnel that came of it.
+//
+// The reset at exit runs on the main thread while an engine thread may be waiting. It sets `abandon`, which
 // ends a wait at its next look with the result of a time-out, then waits for the mutex, and only then
 // clears the header: a waiter never sees a `command` that the reset has cleared. Commands after the reset
-// (the tunnels deleted at exit) are given as ever. The memberships go before the roles are reset: an engine
-// thread that still changes state then reaches no policy group, and tunneld is left with UNKNOWN for all.
-//
-// Policy groups. A second small mutex, also a leaf, keeps the management thread, which changes membership,
-// from the engine's threads, which change roles. A table of 65536 bit sets would be 2 MB of locked memory for
-// what is at most a few hundred memberships, so `policy_grp_members` holds the sets that are not empty, in no
-// order, and grows when one more is needed. Where it can't grow, the membership isn't taken, the caller is
-// told, and what was there stays.
+// (the tunnels deleted at exit) are given as usual. The memberships are cleared before the roles: an engine
+// thread that still changes state then reaches no policy group, and tunneld sees UNKNOWN for all.
 
 #include "engine/wccpd_common.h"
 
 #include <poll.h>
 #include <pthread.h>
 
-#include <cstdlib>
 #include <cstring>
 
 #include "runtime/cmem.h"
@@ -37,6 +33,7 @@
 
 static pthread_mutex_t mailbox_mutex = PTHREAD_MUTEX_INITIALIZER;
 static std::atomic<bool> abandon;
+static wccp_tunnel_mailbox *created_mailbox; // null until this process has created the block
 
 static constexpr int ANSWER_POLLS = 2000;
 
@@ -69,16 +66,23 @@ int wccp_init_shmem() {
     {
         const mutex_guard guard(&mailbox_mutex);
         reset_block(mailbox, WCCP_NO_INDEX);
-        mailbox_put(wccp_mailbox_roles, &mailbox->policy_roles[0]);
         mailbox_put(wccp_mailbox, mailbox);
+        mailbox_put(created_mailbox, mailbox);
     }
     wccp_init_policy_grp_mgr();
     QV_LOG(LC_LOG_DEBUG, "WCCP: Created shared memory of size: %u bytes", length);
     return 0;
 }
 
+bool wccp_publish_policy_role(uint16_t policy, uint32_t role) {
+    wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
+    if (mailbox)
+        mailbox->policy_roles[policy].role.store(role, std::memory_order_relaxed);
+    return mailbox != nullptr;
+}
+
 int wccp_cleanup_shmem() {
-    wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
+    wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
     if (!mailbox)
         return 0;
     wccp_init_policy_grp_mgr();
@@ -123,7 +127,7 @@ const command_kind set_l2_return = {MAILBOX_L2_RETURN, LC_LOG_ERR, "GRE tunnel L
 bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_t *out_status,
                   uint32_t *out_index) {
     const mutex_guard guard(&mailbox_mutex);
-    wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
+    wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
     if (!mailbox)
         return false;
     mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
@@ -197,163 +201,4 @@ int wccp_set_L2_return(uint8_t group_id, uint32_t value) {
     if (!give_command(&set_l2_return, &inputs, &status, &index))
         return 1;
     return static_cast<int>(status);
-}
-
-// Policy groups.
-
-namespace {
-
-constexpr uint32_t SERVICE_GROUPS = 256;
-
-struct policy_grp_set { // one policy group with members
-    uint16_t policy;
-    uint8_t bits[SERVICE_GROUPS / 8]; // service group s is bit s % 8 of byte s / 8
-};
-
-struct service_roles {
-    uint32_t of[SERVICE_GROUPS];
-};
-constexpr service_roles all_unknown() {
-    service_roles roles = {};
-    for (uint32_t &role : roles.of)
-        role = 2;
-    return roles;
-}
-
-pthread_mutex_t policy_mutex = PTHREAD_MUTEX_INITIALIZER;
-// All below: policy_mutex.
-service_roles svc_role = all_unknown();
-uint16_t svc_policy_grp[SERVICE_GROUPS]; // 0 for none
-policy_grp_set *policy_grp_members;
-uint32_t policy_grp_count, policy_grp_room;
-
-policy_grp_set *find_members(uint16_t policy) {
-    for (uint32_t i = 0; i < policy_grp_count; i++)
-        if (policy_grp_members[i].policy == policy)
-            return &policy_grp_members[i];
-    return nullptr;
-}
-
-bool is_member(const policy_grp_set *set, uint32_t id) {
-    return set && ((set->bits[id / 8] >> (id % 8)) & 1) != 0;
-}
-
-policy_grp_set *find_or_make_members(uint16_t policy) {
-    if (policy_grp_set *set = find_members(policy))
-        return set;
-    if (policy_grp_count == policy_grp_room) {
-        const uint32_t room = policy_grp_room ? policy_grp_room * 2 : 16;
-        void *grown = realloc(policy_grp_members, room * sizeof(policy_grp_set));
-        if (!grown)
-            return nullptr;
-        policy_grp_members = static_cast<policy_grp_set *>(grown);
-        policy_grp_room = room;
-    }
-    policy_grp_set *set = &policy_grp_members[policy_grp_count++];
-    *set = {};
-    set->policy = policy;
-    return set;
-}
-
-void forget_members(policy_grp_set *set) {
-    *set = policy_grp_members[--policy_grp_count];
-}
-
-void remove_member(uint16_t policy, uint8_t id) {
-    policy_grp_set *set = find_members(policy);
-    if (!set)
-        return;
-    set->bits[id / 8] = static_cast<uint8_t>(set->bits[id / 8] & ~(1u << (id % 8)));
-    for (const uint8_t byte : set->bits)
-        if (byte)
-            return;
-    forget_members(set);
-}
-
-void update_policy_role(uint16_t policy) {
-    if (!wccp_attach_mailbox())
-        return;
-    std::atomic<uint32_t> *role = &wccp_mailbox_roles[policy].role;
-    const policy_grp_set *set = find_members(policy);
-    if (!set) {
-        role->store(2, std::memory_order_relaxed);
-        QV_LOG(LC_LOG_DEBUG, "WCCP: Update policy group %d role to UNKNOWN", policy);
-        return;
-    }
-    for (uint32_t id = 0; id < SERVICE_GROUPS; id++) {
-        if (!is_member(set, id) || svc_role.of[id] == 0)
-            continue;
-        role->store(1, std::memory_order_relaxed);
-        QV_LOG(LC_LOG_DEBUG, "WCCP: Update policy group %d role to BACKUP", policy);
-        return;
-    }
-    role->store(0, std::memory_order_relaxed);
-    QV_LOG(LC_LOG_DEBUG, "WCCP: Update policy group %d role to ACTIVE", policy);
-}
-
-} // namespace
-
-int wccp_init_policy_grp_mgr() {
-    const mutex_guard guard(&policy_mutex);
-    free(policy_grp_members);
-    policy_grp_members = nullptr;
-    policy_grp_count = policy_grp_room = 0;
-    svc_role = all_unknown();
-    memset(svc_policy_grp, 0, sizeof svc_policy_grp);
-    return 0;
-}
-
-int wccp_add_policy_grp(uint16_t policy, uint32_t count, const uint8_t *ids) {
-    const mutex_guard guard(&policy_mutex);
-    int result = 0;
-    for (uint32_t i = 0; i < count; i++) {
-        const uint8_t id = ids[i];
-        policy_grp_set *set = find_or_make_members(policy);
-        if (!set) {
-            QV_LOG(LC_LOG_ERR, "WCCP: No memory to add Service group %d to Policy group %d", id, policy);
-            result = 1;
-            continue;
-        }
-        set->bits[id / 8] = static_cast<uint8_t>(set->bits[id / 8] | (1u << (id % 8)));
-        svc_policy_grp[id] = policy;
-        QV_LOG(LC_LOG_DEBUG, "WCCP: Add Service group %d to Policy group %d", id, policy);
-    }
-    update_policy_role(policy);
-    return result;
-}
-
-int wccp_remove_policy_grp(uint16_t policy, uint8_t id) {
-    const mutex_guard guard(&policy_mutex);
-    remove_member(policy, id);
-    svc_policy_grp[id] = 0;
-    QV_LOG(LC_LOG_DEBUG, "WCCP GRP %d: Remove Service group from Policy group %d", id, policy);
-    update_policy_role(policy);
-    return 0;
-}
-
-int wccp_del_entire_policy_grp(uint16_t policy) {
-    const mutex_guard guard(&policy_mutex);
-    if (policy_grp_set *set = find_members(policy)) {
-        for (uint32_t id = 0; id < SERVICE_GROUPS; id++)
-            if (is_member(set, id))
-                svc_policy_grp[id] = 0;
-        forget_members(set);
-    }
-    QV_LOG(LC_LOG_DEBUG, "WCCP: Delete Policy group %d", policy);
-    update_policy_role(policy);
-    return 0;
-}
-
-int wccp_check_policy_group(uint16_t policy, uint8_t id) {
-    const mutex_guard guard(&policy_mutex);
-    return is_member(find_members(policy), id) ? 1 : 0;
-}
-
-int wccp_set_role(uint8_t id, uint32_t role) {
-    const mutex_guard guard(&policy_mutex);
-    svc_role.of[id] = role;
-    QV_LOG(LC_LOG_DEBUG, "WCCP GRP %d: Set internal service role to %d", id, static_cast<int>(role));
-    if (svc_policy_grp[id] != 0)
-        update_policy_role(svc_policy_grp[id]);
-    return 0;
 }

@@ -18,7 +18,6 @@
 #include "runtime/logging.h"
 
 wccp_tunnel_mailbox *wccp_mailbox;
-wccp_policy_role *wccp_mailbox_roles;
 
 bool wccp_attach_mailbox() {
     if (mailbox_get(wccp_mailbox))
@@ -39,7 +38,6 @@ bool wccp_attach_mailbox() {
         return false;
     }
     auto *mailbox = static_cast<wccp_tunnel_mailbox *>(block);
-    mailbox_put(wccp_mailbox_roles, &mailbox->policy_roles[0]);
     mailbox_put(wccp_mailbox, mailbox);
     return true;
 }
@@ -121,5 +119,5 @@ void wccp_set_tunnel_command_status(uint32_t status) {
 uint32_t wccp_get_role(uint16_t policy_group) {
     if (!wccp_attach_mailbox())
         return 2;
-    return wccp_mailbox_roles[policy_group].role.load(std::memory_order_relaxed);
+    return wccp_mailbox->policy_roles[policy_group].role.load(std::memory_order_relaxed);
 }

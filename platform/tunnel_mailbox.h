@@ -60,10 +60,9 @@ void mailbox_put(T &field, T value) {
     __atomic_store_n(&field, value, __ATOMIC_RELEASE);
 }
 
-// This process's pointers to the block, null until it has created or attached it.
+// This process's pointer to the block, null until it has created or attached it.
 extern wccp_tunnel_mailbox *wccp_mailbox;
-extern wccp_policy_role *wccp_mailbox_roles;
-// Attaches the block that wccpd made, if it exists and is whole; false when there is none.
+// Attaches the block that wccpd created, if it exists and is long enough; false when there is none.
 bool wccp_attach_mailbox();
 
 // tunneld's side. Without the block these give the defaults or do nothing.

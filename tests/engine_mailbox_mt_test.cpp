@@ -3,7 +3,10 @@
 #include "engine/wccpd_common.h"
 
 #include <gtest/gtest.h>
+#include <sched.h>
 #include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <chrono>
 #include <cstring>
@@ -46,6 +49,49 @@ struct Mailbox : testing::Test {
 };
 
 } // namespace
+
+// First of all, while this process has no mailbox: the two wccpd run in children with shared memory of their
+// own.
+TEST(SecondWccpd, TouchesNothingOfTheFirst) {
+    const pid_t second = fork();
+    if (second == 0) {
+        const uint8_t id = 9;
+        int ready[2];
+        EXPECT_TRUE(unshare(CLONE_NEWIPC) == 0 && pipe(ready) == 0);
+        write_mem_conf();
+        const pid_t first = fork();
+        if (first == 0) {
+            EXPECT_EQ(wccp_init_shmem(), 0);
+            wccp_add_policy_grp(300, 1, &id);
+            wccp_set_role(id, 0);
+            mailbox_put(wccp_mailbox->l2_value, 7u);
+            wccp_mailbox->command = MAILBOX_L2_RETURN;
+            EXPECT_EQ(write(ready[1], "", 1), 1);
+            pause();
+        }
+        char byte;
+        EXPECT_EQ(read(ready[0], &byte, 1), 1);
+        log_lines log;
+        EXPECT_EQ(wccp_init_shmem(), 1);
+        EXPECT_NE(log.take().find("double create attempt"), std::string::npos);
+        wccp_set_role(id, 1);
+        wccp_add_policy_grp(300, 1, &id);
+        wccp_del_entire_policy_grp(300);
+        EXPECT_EQ(log.take(), "");
+        uint32_t index = 5;
+        EXPECT_EQ(wccp_del_tunnel_encap(1, address(1), address(2), &index), 1);
+        EXPECT_EQ(wccp_cleanup_shmem(), 0);
+        EXPECT_EQ(wccp_get_role(300), 0u);
+        EXPECT_EQ(wccp_get_tunnel_command(), MAILBOX_L2_RETURN);
+        EXPECT_EQ(mailbox_get(wccp_mailbox->l2_value), 7u);
+        kill(first, SIGKILL);
+        waitpid(first, nullptr, 0);
+        _exit(testing::Test::HasFailure());
+    }
+    int status = -1;
+    ASSERT_EQ(waitpid(second, &status, 0), second);
+    EXPECT_EQ(status, 0);
+}
 
 #ifndef WCCP_SANITIZED
 // Before any thread has run: the room that one leaves behind would do for the table.
