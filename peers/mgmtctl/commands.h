@@ -27,8 +27,8 @@ struct ctl_options {
     int64_t timeout_ms = 10'000;
 };
 
-// Words that an operator thinks in (groups.cpp): "group add 51 interface eth0 router 10.0.0.1 weight 100".
-// `words` stand behind "group" or "policy". The result is the exit code; messages have been printed.
+// Words that an operator thinks in (group_cli.cpp): "group add 51 interface eth0 router 10.0.0.1 weight 100".
+// `words` follow "group" or "policy". The result is the exit code; messages have been printed.
 int ctl_group(const ctl_options &options, const std::vector<std::string> &words);
 int ctl_policy(const ctl_options &options, const std::vector<std::string> &words);
 // The picture of the whole appliance (show.cpp).

@@ -1,4 +1,4 @@
-// The words of "mgmtctl group" and "mgmtctl policy", apart from the session that carries them.
+// Changing groups and policy groups, apart from the session that carries the requests.
 #pragma once
 
 #include <functional>
@@ -7,15 +7,6 @@
 #include <vector>
 
 #include "peers/mgmtctl/commands.h"
-
-struct group_word {
-    const char *word;
-    const char *node; // below the group's root; "router" stands for the list of its entries
-    const char *hint; // of its values; null: as the schema has them
-    bool whole;       // wccpd takes a change only with the group as a whole
-    bool free_text;   // any text is a value, "default" too
-};
-const std::vector<group_word> &group_words();
 
 // Two requests of a session, so that a test can answer them.
 struct group_link {
@@ -34,7 +25,7 @@ struct group_result {
     int commits = 0;   // that were made
     uint32_t code = 0; // of mgmtd's refusal
     std::string error;
-    std::string note;  // for a person, behind what was done
+    std::string note;  // for a person, after what was done
     std::string wccpd; // "running", "absent", "silent"; empty where it doesn't matter
     bool runs = false; // wccpd has the group
     std::string state; // ACTIVE, BACKUP, INIT
@@ -43,3 +34,14 @@ struct group_result {
 
 group_result group_command(const group_link &link, const std::vector<std::string> &words);
 group_result policy_command(const group_link &link, const std::vector<std::string> &words);
+
+// What was set of a group, by its names below the group's root; a value that is the default is left out.
+using group_nodes = std::map<std::string, std::string>;
+std::vector<std::string> group_routers(const group_nodes &nodes); // their addresses, in their order
+
+struct listed_group {
+    std::string number;
+    group_nodes nodes;
+};
+// All groups or policy groups below `above`.
+group_result list_groups(const group_link &link, const std::string &above, std::vector<listed_group> *out);

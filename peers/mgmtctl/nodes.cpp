@@ -14,8 +14,8 @@
 
 #include "mgmt/bnode_types.h"
 #include "mgmt/node_paths.h"
-#include "peers/mgmtctl/edit_distance.h"
-#include "peers/mgmtctl/groups.h"
+#include "peers/mgmtctl/group_words.h"
+#include "peers/mgmtctl/nearest_word.h"
 #include "runtime/common.h"
 
 static node_name named(const std::string &text) {
@@ -93,17 +93,6 @@ std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above)
 
 // --- Names that were meant
 
-static const std::string *nearest(const std::string &wanted, const std::vector<std::string> &known) {
-    const std::string *best = nullptr;
-    size_t least = std::min<size_t>(3, wanted.size()); // as many mistakes are another word
-    for (const std::string &each : known)
-        if (const size_t away = edit_distance(wanted.substr(0, 64), each); away < least) {
-            least = away;
-            best = &each;
-        }
-    return best;
-}
-
 std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
     if (text == "/")
         return "\"mgmtctl walk /\" lists what there is";
@@ -125,7 +114,7 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
     for (const std::string &part : name.parts) {
         const std::vector<std::string> known = names_below(ask, good);
         if (std::find(known.begin(), known.end(), part) == known.end()) {
-            if (const std::string *meant = nearest(part, known))
+            if (const std::string *meant = nearest_word(part, known, 2))
                 return "did you mean " + good.below(*meant).text() + "?";
             return known.empty() ? ""
                                  : "\"mgmtctl walk " + (good.parts.empty() ? "/" : good.text()) +

@@ -1,0 +1,183 @@
+// "mgmtctl group" and "mgmtctl policy": their session, and what a person and a script get to read.
+#include <cstdio>
+#include <map>
+
+#include <termios.h>
+#include <unistd.h>
+
+#include "mgmt/node_paths.h"
+#include "peers/mgmtctl/group_words.h"
+#include "peers/mgmtctl/groups.h"
+#include "peers/mgmtctl/render.h"
+
+static constexpr size_t SECRET_MAX = 256; // more than any password has; mgmtd says what is too long
+
+static ctl_json as_json(const group_result &result) {
+    ctl_json out = {{result.kind == "group" ? "group" : "policy",
+                     result.number < 0 ? ctl_json(nullptr) : ctl_json(result.number)},
+                    {"done", result.done.empty() ? "nothing" : result.done},
+                    {"commits", result.commits}};
+    if (!result.wccpd.empty()) {
+        out["wccpd"] = result.wccpd;
+        out["running"] = result.runs;
+        out["state"] = result.state.empty() ? ctl_json(nullptr) : ctl_json(result.state);
+        out["designated"] = result.designated;
+    }
+    if (!result.note.empty())
+        out["note"] = result.note;
+    if (result.exit == CTL_OK)
+        return out;
+    out["error"] = result.error;
+    out["code"] = result.code;
+    out["exit"] = result.exit;
+    return out;
+}
+
+static std::string as_text(const group_result &result) {
+    static const std::map<std::string, std::string> outcomes = {
+        {"added", " added"},     {"changed", " changed"},       {"recreated", " deleted and created again"},
+        {"deleted", " deleted"}, {"unchanged", " is as asked"},
+    };
+    std::string text = result.kind + " " + std::to_string(result.number) + outcomes.at(result.done);
+    if (!result.note.empty())
+        text += " (" + result.note + ")";
+    if (result.wccpd == "absent")
+        text += "; wccpd is not running";
+    else if (result.wccpd == "silent")
+        text += "; wccpd does not answer";
+    else if (result.runs && result.done == "deleted")
+        text += "; wccpd still has it";
+    else if (result.runs)
+        text += "; state " + result.state + (result.designated ? ", designated" : "");
+    else if (!result.wccpd.empty() && result.done != "deleted")
+        text += "; wccpd does not have it, its log tells why";
+    return text;
+}
+
+static int tell(const ctl_options &options, const group_result &result) {
+    if (options.json)
+        put(json_line(as_json(result)));
+    else if (result.exit == CTL_OK)
+        put(as_text(result) + "\n");
+    else
+        return tell_failure(
+            options, {result.exit, result.number < 0 ? "" : result.kind + " " + std::to_string(result.number),
+                      result.error, result.note, result.code});
+    return result.exit;
+}
+
+static int list_words(const ctl_options &options) {
+    ctl_json all = ctl_json::array();
+    for (const group_word &word : group_words()) {
+        const char *fallback = group_word_fallback(word);
+        if (!options.json)
+            put(word.word + std::string(17 - std::string(word.word).size(), ' ') + group_word_values(word) +
+                (fallback && *fallback ? std::string("; default ") + fallback : "") + "\n");
+        all.push_back({{"word", word.word},
+                       {"node", word.node},
+                       {"values", group_word_values(word)},
+                       {"default", fallback ? ctl_json(fallback) : ctl_json(nullptr)},
+                       {"recreates", word.whole}});
+    }
+    if (options.json)
+        put(json_line(all));
+    return CTL_OK;
+}
+
+// Each group as the words that would add it.
+static void tell_list(const ctl_options &options, const std::vector<listed_group> &groups) {
+    ctl_json all = ctl_json::array();
+    for (const listed_group &group : groups) {
+        const std::vector<std::string> routers = group_routers(group.nodes);
+        std::string line = group.number;
+        ctl_json one = {{"number", std::atol(group.number.c_str())}, {"routers", routers}};
+        for (const std::string &router : routers)
+            line += " router " + router;
+        for (const auto &[name, value] : group.nodes) {
+            if (name.starts_with("router/"))
+                continue;
+            const group_word *word = find_group_word(name);
+            const bool hidden = name == "password" && !options.secrets;
+            line += std::string(" ") + (word ? word->word : name.c_str()) + " " +
+                    (hidden ? "********" : shell_quoted(value));
+            one[word ? word->word : name] = hidden ? "********" : value;
+        }
+        if (!options.json)
+            put(line + "\n");
+        all.push_back(one);
+    }
+    if (options.json)
+        put(json_line(all));
+}
+
+static int run(const ctl_options &options, const std::vector<std::string> &words, const char *above,
+               const char *kind,
+               group_result (*command)(const group_link &link, const std::vector<std::string> &words)) {
+    // What is wrong with the words is told without mgmtd as well.
+    struct closer {
+        ctl_session *session = nullptr;
+        ~closer() {
+            if (session)
+                ctl_close(session);
+        }
+    } held;
+    group_link link;
+    const auto open = [&](std::string *out_reason) {
+        if (!held.session)
+            held.session = ctl_open(options.timeout_ms, out_reason);
+        return held.session != nullptr;
+    };
+    link.query = [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
+        return open(out_reason) && ctl_query(held.session, walk, name, out, out_reason);
+    };
+    link.set = [&](const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *out_reason) {
+        return open(out_reason) && ctl_set(held.session, items, out, out_reason);
+    };
+    if (words.size() == 1 && words[0] == "list") {
+        std::vector<listed_group> groups;
+        group_result result = list_groups(link, above, &groups);
+        result.kind = kind;
+        if (result.exit != CTL_OK)
+            return tell(options, result);
+        tell_list(options, groups);
+        return CTL_OK;
+    }
+    return tell(options, command(link, words));
+}
+
+// A line of standard input, which everybody on the machine could read in a command line. A terminal is asked,
+// and doesn't show it. False at the end of the input, or when a signal ends the program.
+static bool read_secret(std::string *out) {
+    termios before = {};
+    const bool terminal = tcgetattr(STDIN_FILENO, &before) == 0;
+    if (terminal) {
+        termios silent = before;
+        silent.c_lflag &= ~static_cast<tcflag_t>(ECHO);
+        fputs("password: ", stderr);
+        (void)tcsetattr(STDIN_FILENO, TCSAFLUSH, &silent);
+    }
+    char byte = '\0';
+    ssize_t got = 0;
+    out->clear();
+    while (out->size() < SECRET_MAX && (got = read(STDIN_FILENO, &byte, 1)) == 1 && byte != '\n')
+        *out += byte;
+    if (terminal) {
+        (void)tcsetattr(STDIN_FILENO, TCSAFLUSH, &before);
+        fputc('\n', stderr);
+    }
+    return got == 1 || (got == 0 && !out->empty());
+}
+
+int ctl_group(const ctl_options &options, const std::vector<std::string> &words) {
+    if (words.size() == 1 && words[0] == "words")
+        return list_words(options);
+    std::vector<std::string> filled = words;
+    for (size_t i = 3; i < filled.size(); i += 2)
+        if (filled[i - 1] == "password" && filled[i] == "-" && !read_secret(&filled[i]))
+            return tell_failure(options, {CTL_USAGE, "", "there is no password on standard input", "", 0});
+    return run(options, filled, NODE_GROUP_CONFIG, "group", group_command);
+}
+
+int ctl_policy(const ctl_options &options, const std::vector<std::string> &words) {
+    return run(options, words, NODE_POLICY_CONFIG, "policy group", policy_command);
+}
