@@ -86,7 +86,7 @@ static const mon_dump assignment_dump = {
 // First match wins.
 static const mon_node mon_nodes[] = {
     {NODE_WCCPD_STATE "/proto_ver", bn_type_str, VALUE(put_words(out, "2.0")), nullptr},
-    {NODE_WCCPD_STATE "/version", bn_type_str, VALUE(put_words(out, wccp_version())), nullptr},
+    {NODE_WCCPD_VERSION, bn_type_str, VALUE(put_words(out, wccp_version())), nullptr},
     {NODE_GROUP_STATE "/*/oper", bn_type_str, VALUE(put_words(out, s->group_info.oper)), nullptr},
     {NODE_GROUP_STATE "/*/uptime", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->group_info.uptime)),
      nullptr},

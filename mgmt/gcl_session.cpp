@@ -66,13 +66,17 @@ static lc_status set_user(gcl_session *session) {
     return LC_OK;
 }
 
+void gcl_socket_path(const char *role, const char *name, char *out, size_t size) {
+    if (lc_devel_is_production())
+        snprintf(out, size, "%suds-%s-%s", GCL_SOCKET_DIRECTORY, role, name);
+    else
+        snprintf(out, size, "%suds-%s-UID-%d-%s", GCL_SOCKET_DIRECTORY, role, static_cast<int>(geteuid()),
+                 name);
+}
+
 static void make_endpoint(gcl_endpoint *endpoint, const char *role, const char *name) {
     char path[256];
-    if (lc_devel_is_production())
-        snprintf(path, sizeof path, "%suds-%s-%s", GCL_SOCKET_DIRECTORY, role, name);
-    else
-        snprintf(path, sizeof path, "%suds-%s-UID-%d-%s", GCL_SOCKET_DIRECTORY, role,
-                 static_cast<int>(geteuid()), name);
+    gcl_socket_path(role, name, path, sizeof path);
     strlcpy(endpoint->path, path, sizeof endpoint->path);
     sockaddr_un address{};
     address.sun_family = AF_UNIX;

@@ -12,6 +12,9 @@ constexpr uint32_t GCL_FRAME_VERSION = 1;
 constexpr uint32_t GCL_SEQUENCE_CLIENT = 2000001;
 constexpr uint32_t GCL_SEQUENCE_PROVIDER = 1000001;
 constexpr const char *GCL_SOCKET_DIRECTORY = "/tmp/gcl-socks/";
+// The path of a socket in that directory: `role` is "provider" or "client". A development system has the
+// user's number in it.
+void gcl_socket_path(const char *role, const char *name, char *out, size_t size);
 
 struct gcl_wire_header {
     char ident[4];

@@ -13,9 +13,12 @@
 constexpr const char *SYSTEM_LEVEL = MESSAGES_FILE "/facility/all/min_priority";
 constexpr const char *OVERRIDE_ENABLE = MESSAGES_FILE "/facility/override/enable";
 
+namespace {
 struct node_name {
     char text[160];
 };
+} // namespace
+
 static node_name process_level_node() {
     node_name name;
     snprintf(name.text, sizeof name.text, NODE_SYSLOG "/process/%s/log_level", lc_log_get_lls_process_name());

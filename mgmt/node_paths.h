@@ -19,6 +19,7 @@
 // --- State nodes, answered by wccpd
 #define NODE_WCCPD_STATE NODE_WCCPD "/system/state"
 #define NODE_WCCPD_STATUS NODE_WCCPD_STATE "/is_alive"
+#define NODE_WCCPD_VERSION NODE_WCCPD_STATE "/version"
 #define NODE_GROUP_STATE NODE_WCCPD "/wccp/srv_grp/state"
 
 // --- State nodes, kept by mgmtd

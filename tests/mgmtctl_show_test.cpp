@@ -1,4 +1,5 @@
-// The picture of "mgmtctl show": gathered from canned nodes, drawn for a terminal and as JSON, within bounds.
+// The snapshot of "mgmtctl show": gathered from canned nodes, drawn for a terminal and as JSON, within
+// bounds.
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -8,7 +9,9 @@
 
 #include <nlohmann/json.hpp>
 
-#include "peers/mgmtctl/show_picture.h"
+#include "peers/mgmtctl/show_draw.h"
+#include "peers/mgmtctl/show_gather.h"
+#include "peers/mgmtctl/show_texts.h"
 #include "runtime/common.h"
 
 using json = nlohmann::json;
@@ -42,11 +45,13 @@ struct canned {
         }
         return true;
     }
-    picture gather(const picture_limits &limits = {}) {
+    snapshot gather(const snapshot_limits &limits = {}) {
         asked = 0;
-        return gather_picture([this](ctl_walk walk, const std::string &name, ctl_reply *out,
-                                     std::string *out_reason) { return answer(walk, name, out, out_reason); },
-                              limits);
+        return gather_snapshot(
+            [this](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
+                return answer(walk, name, out, out_reason);
+            },
+            limits);
     }
 };
 
@@ -90,6 +95,7 @@ canned one_group() {
         from.add(root + "/appliance/10.0.0.102/load_dist", "75");
     }
     from.add("/qv/wccpd/system/state/is_alive", "Ready");
+    from.add("/qv/wccpd/system/state/version", "1.0.0");
     from.add(STATE + "51/debug", "    WCCP interfaces                  : # 1 eth0\n"
                                  "    WCCP interface ipa and link      : 10.0.0.101 up \n");
     from.add(STATE + "51/assignment", "\tAppliance ip               : 10.0.0.101\n"
@@ -153,7 +159,7 @@ std::string joined(const std::vector<std::string> &lines) {
 } // namespace
 
 TEST(Show, TellsTheWholeOfAGroup) {
-    const picture shown = one_group().gather();
+    const snapshot shown = one_group().gather();
     const json all = json::parse(draw_json(shown)), group = all["groups"][0];
     ASSERT_EQ(group["routers"].size(), 3u);
     EXPECT_EQ(group["routers"][0]["address"], "10.0.0.1") << "by address, whatever their numbers";
@@ -169,16 +175,19 @@ TEST(Show, TellsTheWholeOfAGroup) {
         group["tables"][0]["buckets"].dump(),
         R"([{"appliance":"10.0.0.101","first":0,"last":63},{"appliance":"10.0.0.102","first":64,"last":255}])");
     EXPECT_EQ(all["alarms"][0]["group"], 51);
+    EXPECT_EQ(all["version"], "1.0.0");
 
     const std::string screen = joined(draw_screen(shown, {80, 23, false, false, ""}));
     for (const char *text :
-         {"1 alarm\n! group 51: a router is not connected as it should be, since 2026/11/25 00:10:11\n",
+         {"wccpd Ready (1.0.0)   1 group: 1 active   1 alarm\n! group 51: a router is not connected as it should be, since 2026/11/25 00:10:11\n",
           "51  ACTIVE, designated !  up 1:02:03  10.0.0.101 on eth0  tcp  weight 25  md5\n",
           "  router 10.0.0.1        two-way   0:01:00  fwd gre  assign -     return l2",
           "  router 10.0.0.3        nothing heard\n",
           "  A 10.0.0.101      this weight 25    asked  30% has 20-25%  ####..",
           "  hash AAAAAAAAAAAAAAAABBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBB\n"})
         EXPECT_NE(screen.find(text), std::string::npos) << text << "\nnot in\n" << screen;
+    EXPECT_EQ(draw_screen(shown, {48, 0, false, false, ""})[0], "wccpd Ready   1 group: 1 active   1 alarm")
+        << "no room for the version";
     for (const std::string &line : draw_screen(shown, {79, 23, true, true, ""}))
         EXPECT_LE(columns_of(line), 79u) << line;
 }
@@ -189,7 +198,7 @@ TEST(Show, NothingOfATextReachesTheTerminalAsAControl) {
         if (node.name.find("/state") != std::string::npos && !node.name.ends_with("/oper"))
             node.value += "\033[2J\x9b"
                           "1m\r\n";
-    const picture shown = from.gather();
+    const snapshot shown = from.gather();
     for (const std::string &text :
          {joined(draw_screen(shown, {80, 0, false, false, ""})), joined(draw_lines(shown)), draw_json(shown)})
         for (const char c : text)
@@ -199,33 +208,33 @@ TEST(Show, NothingOfATextReachesTheTerminalAsAControl) {
 TEST(Show, IsEmptyAndSaysSoWhereverMgmtdGoes) {
     canned from = one_group();
     from.wccpd_code = LC_IO_TIMED_OUT;
-    EXPECT_EQ(from.gather().wccpd, picture_wccpd::silent);
+    EXPECT_EQ(from.gather().wccpd, wccpd_condition::silent);
     EXPECT_EQ(from.asked, 6u) << "it is not asked again";
     from.wccpd_code = 0;
     (void)from.gather();
     for (size_t all = from.asked, n = 0; n < all; n++) {
         from.lost_after = n;
-        const picture shown = from.gather();
+        const snapshot shown = from.gather();
         EXPECT_TRUE(shown.groups.empty() && !shown.unreachable.empty());
     }
 }
 
 TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
     size_t asked = 0;
-    const picture_query query = [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *) {
+    const snapshot_query query = [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *) {
         asked++;
         return many(walk, name, out);
     };
-    picture_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
-    std::vector<std::string> lines = draw_screen(gather_picture(query, limits), {79, 23, true, true, ""});
-    EXPECT_LE(asked, 6u + 23u * 6);
+    snapshot_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
+    std::vector<std::string> lines = draw_screen(gather_snapshot(query, limits), {79, 23, true, true, ""});
+    EXPECT_LE(asked, 7u + 23u * 6);
     ASSERT_EQ(lines.size(), 23u);
     EXPECT_NE(lines[1].find("routers 31/31  share 3%"), std::string::npos) << lines[1];
     EXPECT_NE(lines.back().find("and 235 groups not shown"), std::string::npos) << lines.back();
 
     asked = 0;
     limits = {.queries = 300};
-    const picture detailed = gather_picture(query, limits);
+    const snapshot detailed = gather_snapshot(query, limits);
     EXPECT_LE(asked, 300u + 70u);
     const json all = json::parse(draw_json(detailed));
     EXPECT_EQ(all["groups_total"], 256);
@@ -247,7 +256,7 @@ TEST(Show, AssignmentTextsAreReadTolerantly) {
          std::map<std::string, std::string>{{"10.0.0.101", "0x0000000f"}, {"10.0.0.102", "0x00001ff0"}})
         mask += "\tRouter id                  : 10.0.0.1\n\tAppliance ip               : " + appliance +
                 "\n\tRxed value buckets (0-127) : " + words + " 00000000 00000000 00000000\n";
-    picture_group group;
+    snapshot_group group;
     take_assignment_text(mask, &group);
     ASSERT_EQ(group.tables.size(), 1u);
     EXPECT_TRUE(group.tables[0].mask);
@@ -261,10 +270,10 @@ TEST(Show, AssignmentTextsAreReadTolerantly) {
         std::string cut = whole.substr(0, length);
         if (length > 4)
             cut[length - 4] = static_cast<char>(length);
-        picture_group from;
+        snapshot_group from;
         take_assignment_text(cut, &from);
         take_group_text(cut, &from);
-        for (const picture_table &table : from.tables)
+        for (const snapshot_table &table : from.tables)
             for (const int owner : table.owners)
                 ASSERT_LT(owner, static_cast<int>(from.appliances.size()));
     }
@@ -276,7 +285,7 @@ TEST(Show, AssignmentTextsAreReadTolerantly) {
         crowd += rows.replace(rows.find("0xffffffff"), 10, words) +
                  "\tAppliance ip               : " + std::to_string(i) + "\n";
     }
-    picture_group from;
+    snapshot_group from;
     take_assignment_text(crowd, &from);
     EXPECT_LE(from.appliances.size(), 32u);
     EXPECT_LE(from.tables.size(), 32u);

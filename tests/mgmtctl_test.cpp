@@ -3,6 +3,7 @@
 #include <thread>
 
 #include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/nodes.h"

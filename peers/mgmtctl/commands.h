@@ -1,4 +1,4 @@
-// The words of mgmtctl's command line, and what every one of them keeps to.
+// The words of mgmtctl's command line, their options and their exit codes.
 #pragma once
 
 #include <string>
@@ -13,7 +13,7 @@ enum ctl_exit : int {
     CTL_USAGE = 2,       // the command line
     CTL_UNREACHABLE = 3, // no mgmtd, no answer, or the session was lost
     CTL_NOT_FOUND = 4,   // no such node or group
-    CTL_PARTLY = 5,      // a change of several commits stopped in between; what is left undone is told
+    CTL_PARTLY = 5,      // a change of several commits stopped in between; the rest is reported
     CTL_STANDING = 6,    // alarms --check: an alarm stands
     CTL_OUTPUT = 7,      // standard output took not all of it
 };
@@ -27,9 +27,25 @@ struct ctl_options {
     int64_t timeout_ms = 10'000;
 };
 
-// Words that an operator thinks in (group_cli.cpp): "group add 51 interface eth0 router 10.0.0.1 weight 100".
-// `words` follow "group" or "policy". The result is the exit code; messages have been printed.
+// One function for each word of the command line. The result is the exit code; what there is to say has been
+// printed.
+
+// Nodes by their names (node_cli.cpp).
+int ctl_get(const ctl_options &options, const std::vector<std::string> &names);
+int ctl_walk_nodes(const ctl_options &options, const std::string &name, ctl_walk how);
+// `words` are NAME VALUE, or NAME=VALUE...; `existing`: no group, policy group or router is made.
+int ctl_change_nodes(const ctl_options &options, const std::vector<std::string> &words, bool existing);
+int ctl_delete(const ctl_options &options, const std::vector<std::string> &names);
+int ctl_alarms(const ctl_options &options, bool check);
+// Prints nothing but what fits, whatever is wrong: it is called while somebody types.
+int ctl_complete(const std::string &word);
+
+// Groups in an operator's words (group_cli.cpp): "group add 51 interface eth0 router 10.0.0.1 weight 100".
+// `words` follow "group" or "policy".
 int ctl_group(const ctl_options &options, const std::vector<std::string> &words);
 int ctl_policy(const ctl_options &options, const std::vector<std::string> &words);
-// The picture of the whole appliance (show.cpp).
+
+// The whole appliance (show.cpp).
 int ctl_show(const ctl_options &options);
+// Events as they come (watch.cpp). `count` 0: until a signal ends the program.
+int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count);

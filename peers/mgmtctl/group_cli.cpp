@@ -2,6 +2,7 @@
 #include <cstdio>
 #include <map>
 
+#include <nlohmann/json.hpp>
 #include <termios.h>
 #include <unistd.h>
 

@@ -11,207 +11,13 @@
 #include <cstdio>
 #include <cstring>
 #include <functional>
-#include <memory>
 
 #include <CLI/CLI.hpp>
 #include <poll.h>
 #include <unistd.h>
 
-#include "mgmt/node_paths.h"
-#include "peers/mgmtctl/nodes.h"
-#include "peers/mgmtctl/render.h"
-#include "peers/mgmtctl/watch.h"
-#include "runtime/common.h"
+#include "peers/mgmtctl/commands.h"
 #include "runtime/version.h"
-
-namespace {
-struct closer {
-    void operator()(ctl_session *session) const { ctl_close(session); }
-};
-// A session, or the exit code of its failure, which has been told.
-struct connection {
-    const ctl_options &options;
-    std::unique_ptr<ctl_session, closer> session;
-    std::string reason;
-    int code = CTL_OK;
-
-    explicit connection(const ctl_options &wanted) : options(wanted) {
-        session.reset(ctl_open(options.timeout_ms, &reason));
-        if (!session)
-            code = lost();
-    }
-    int lost() const { return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0}); }
-    bool ask(ctl_walk walk, const std::string &name, ctl_reply *out) {
-        return ctl_query(session.get(), walk, name, out, &reason);
-    }
-    ctl_ask asking() {
-        return
-            [this](ctl_walk walk, const std::string &name, ctl_reply *out) { return ask(walk, name, out); };
-    }
-};
-} // namespace
-
-// --- get and walk
-
-static ctl_failure missing(connection *mgmtd, const std::string &text) {
-    node_name name;
-    const schema_row *row = parse_node_name(text, &name) ? find_schema_row(name) : nullptr;
-    return {CTL_NOT_FOUND, text, row && !row->instance ? "is not set" : "there is no such node",
-            hint_for_missing(mgmtd->asking(), text), LC_NOT_FOUND};
-}
-
-static int get(const ctl_options &options, const std::vector<std::string> &names) {
-    connection mgmtd(options);
-    if (!mgmtd.session)
-        return mgmtd.code;
-    int code = CTL_OK;
-    ctl_json nodes = ctl_json::array();
-    for (const std::string &name : names) {
-        ctl_reply reply;
-        if (!mgmtd.ask(ctl_walk::node, name, &reply))
-            return mgmtd.lost();
-        if (reply.code == 0 && !reply.bindings.empty()) {
-            const ctl_binding &binding = reply.bindings[0];
-            nodes.push_back(json_node(binding, options.secrets));
-            if (!options.json)
-                put(names.size() == 1 ? shown_value(binding, options.secrets) + "\n"
-                                      : text_node(binding, options.secrets));
-            continue;
-        }
-        const ctl_failure failure =
-            reply.code == 0 ? missing(&mgmtd, name)
-                            : ctl_failure{exit_of(reply.code), name, reply.message, "", reply.code};
-        nodes.push_back(json_failure(failure));
-        if (!options.json)
-            (void)tell_failure(options, failure);
-        code = code == CTL_OK ? failure.exit : code;
-    }
-    if (options.json)
-        put(json_line(nodes));
-    return code;
-}
-
-static int walk(const ctl_options &options, const std::string &name, ctl_walk how) {
-    connection mgmtd(options);
-    if (!mgmtd.session)
-        return mgmtd.code;
-    std::vector<ctl_binding> found;
-    // The root of all names is no node, and neither is its walk a query.
-    for (const std::string &root :
-         name == "/" ? std::vector<std::string>{"/logging", "/qv"} : std::vector<std::string>{name}) {
-        ctl_reply reply;
-        if (!mgmtd.ask(how, root, &reply))
-            return mgmtd.lost();
-        if (reply.code != 0)
-            return tell_failure(options, {exit_of(reply.code), root, reply.message, "", reply.code});
-        if (how != ctl_walk::children && !add_appliances(mgmtd.asking(), root, &reply.bindings))
-            return mgmtd.lost();
-        found.insert(found.end(), reply.bindings.begin(), reply.bindings.end());
-    }
-    if (found.empty())
-        return tell_failure(
-            options, {CTL_NOT_FOUND, name,
-                      how == ctl_walk::children ? "no node is directly below" : "there is nothing below",
-                      hint_for_missing(mgmtd.asking(), name), LC_NOT_FOUND});
-    ctl_json nodes = ctl_json::array();
-    for (const ctl_binding &binding : found) {
-        if (options.json)
-            nodes.push_back(json_node(binding, options.secrets));
-        else
-            put(text_node(binding, options.secrets));
-    }
-    if (options.json)
-        put(json_line(nodes));
-    return CTL_OK;
-}
-
-// --- set and delete
-
-static int refused_change(const ctl_options &options, connection *mgmtd, const ctl_reply &reply,
-                          const std::vector<ctl_change_item> &items) {
-    ctl_failure failure = {exit_of(reply.code), "", reply.message, "", reply.code};
-    // A refusal begins with the name of its node.
-    for (const ctl_change_item &item : items)
-        if (reply.message.starts_with(item.binding.name + ": "))
-            failure.node = item.binding.name;
-    if (!failure.node.empty())
-        failure.error.erase(0, failure.node.size() + 2);
-    if (reply.code == LC_NOT_FOUND || reply.code == LC_BAD_PATH)
-        failure.hint = hint_for_unchangeable(mgmtd->asking(), failure.node);
-    return tell_failure(options, failure);
-}
-
-// One commit.
-static int change(const ctl_options &options, const std::vector<ctl_change_item> &items) {
-    connection mgmtd(options);
-    if (!mgmtd.session)
-        return mgmtd.code;
-    groups_before before;
-    ctl_reply reply;
-    if (!look_before(mgmtd.asking(), items, &before) ||
-        !ctl_set(mgmtd.session.get(), items, &reply, &mgmtd.reason))
-        return mgmtd.lost();
-    if (reply.code != 0)
-        return refused_change(options, &mgmtd, reply, items);
-    const change_notes said = notes_of(items, before);
-    if (!options.json) {
-        for (const std::string &root : said.created)
-            put("created " + root + "\n");
-        for (const std::string &note : said.notes)
-            fprintf(stderr, "mgmtctl: note: %s\n", note.c_str());
-        return CTL_OK;
-    }
-    ctl_json changed = ctl_json::array();
-    for (const ctl_change_item &item : items)
-        changed.push_back(item.binding.name);
-    put(json_line({{"changed", changed}, {"created", said.created}, {"notes", said.notes}, {"exit", 0}}));
-    return CTL_OK;
-}
-
-static int set(const ctl_options &options, const std::vector<std::string> &words, bool existing) {
-    std::vector<ctl_change_item> items;
-    const std::string wrong =
-        parse_assignments(words, existing ? ctl_change::modify : ctl_change::create, &items);
-    if (!wrong.empty())
-        return tell_failure(options, {CTL_USAGE, "", wrong, "", 0});
-    return change(options, items);
-}
-
-static int remove(const ctl_options &options, const std::vector<std::string> &names) {
-    std::vector<ctl_change_item> items;
-    items.reserve(names.size());
-    for (const std::string &name : names)
-        items.push_back({ctl_change::remove, {name, "", ""}});
-    return change(options, items);
-}
-
-// --- alarms and completion
-
-static int alarms(const ctl_options &options, bool check) {
-    connection mgmtd(options);
-    if (!mgmtd.session)
-        return mgmtd.code;
-    ctl_reply reply;
-    if (!mgmtd.ask(ctl_walk::subtree, NODE_ALARMS_RAISED, &reply))
-        return mgmtd.lost();
-    if (reply.code != 0)
-        return tell_failure(options, {exit_of(reply.code), "", reply.message, "", reply.code});
-    const std::vector<ctl_alarm> standing = alarms_of(reply.bindings);
-    put(options.json ? json_line(json_alarms(standing)) : text_alarms(standing));
-    return check && !standing.empty() ? CTL_STANDING : CTL_OK;
-}
-
-// Says nothing but what fits, whatever is wrong: it is asked while somebody types.
-static int complete(const std::string &word) {
-    std::string reason;
-    const std::unique_ptr<ctl_session, closer> session(ctl_open(1000, &reason));
-    const ctl_ask ask = [&](ctl_walk walk, const std::string &name, ctl_reply *out) {
-        return session && ctl_query(session.get(), walk, name, out, &reason);
-    };
-    for (const std::string &candidate : completions(ask, word))
-        put(candidate + "\n");
-    return CTL_OK;
-}
 
 // --- The end
 
@@ -312,28 +118,28 @@ int main(int argc, char **argv) {
         command->callback([&run, function = std::move(function)] { run = function; });
         return command;
     };
-    CLI::App *command = add("get", "values of nodes", [&] { return get(options, words); });
+    CLI::App *command = add("get", "values of nodes", [&] { return ctl_get(options, words); });
     command->add_option("NAME", words)->required();
     command = add("walk", "a node and all below it", [&] {
-        return walk(options, name,
-                    children ? ctl_walk::children
-                    : leaves ? ctl_walk::leaves
-                             : ctl_walk::subtree);
+        return ctl_walk_nodes(options, name,
+                              children ? ctl_walk::children
+                              : leaves ? ctl_walk::leaves
+                                       : ctl_walk::subtree);
     });
     command->add_option("NAME", name)->capture_default_str();
     CLI::Option *only_children = command->add_flag("--children", children, "what is directly below it only");
     command->add_flag("--leaves", leaves, "only nodes with nothing below them")->excludes(only_children);
-    command = add("set", "set nodes: one commit", [&] { return set(options, words, existing); });
+    command = add("set", "set nodes: one commit", [&] { return ctl_change_nodes(options, words, existing); });
     command->add_option("NAME=VALUE", words, "or NAME VALUE")->required();
     command->add_flag("--existing", existing, "make no new group, policy group or router");
-    command =
-        add("delete", "delete nodes with all below them: one commit", [&] { return remove(options, words); });
+    command = add("delete", "delete nodes with all below them: one commit",
+                  [&] { return ctl_delete(options, words); });
     command->add_option("NAME", words)->required();
     command = add("watch", "changes, alarms, roles and processes, as they come",
                   [&] { return ctl_watch(options, words, count); });
     command->add_option("NAME", words, "changes of this and below it only; * is one part of a name");
     command->add_option("--count", count, "end after so many events");
-    command = add("alarms", "the alarms that stand", [&] { return alarms(options, check); });
+    command = add("alarms", "the alarms that stand", [&] { return ctl_alarms(options, check); });
     command->add_flag("--check", check, "exit with 6 when there are any");
     command = add("group", "service groups: add, set, restart, delete, list, words",
                   [&] { return ctl_group(options, words); });
@@ -349,7 +155,7 @@ int main(int argc, char **argv) {
         "--colour", [&] { options.colour = 1; }, "in colour, whatever the output is");
     command->add_flag_callback(
         "--no-colour", [&] { options.colour = 0; }, "without colour");
-    command = add("complete", "", [&] { return complete(words.empty() ? "" : words[0]); });
+    command = add("complete", "", [&] { return ctl_complete(words.empty() ? "" : words[0]); });
     command->add_option("WORD", words);
     command->group(""); // for the shell
 

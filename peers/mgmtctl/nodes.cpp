@@ -170,6 +170,19 @@ std::vector<std::string> completions(const ctl_ask &ask, const std::string &word
 
 // --- Appliances of a walk
 
+bool query_appliances(const ctl_ask &ask, const std::string &list, unsigned long count,
+                      std::vector<ctl_binding> *inout) {
+    for (unsigned long i = 1; i <= std::min(count, APPLIANCES_MAX); i++)
+        for (const char *leaf : {"/ipaddr", "/weight"}) {
+            ctl_reply reply;
+            if (!ask(ctl_walk::node, std::string(list).append("/").append(std::to_string(i)).append(leaf),
+                     &reply))
+                return false;
+            inout->insert(inout->end(), reply.bindings.begin(), reply.bindings.end());
+        }
+    return true;
+}
+
 bool add_appliances(const ctl_ask &ask, const std::string &root_text, std::vector<ctl_binding> *inout) {
     static const node_name counts = named(NODE_GROUP_STATE "/*/num_appliances");
     const node_name root = named(root_text);
@@ -192,14 +205,8 @@ bool add_appliances(const ctl_ask &ask, const std::string &root_text, std::vecto
         node_name one = named(count.name);
         one.parts.back() = "appliance";
         std::vector<ctl_binding> added;
-        const unsigned long number = std::min(strtoul(count.value.c_str(), nullptr, 10), 32ul);
-        for (unsigned long i = 1; i <= number; i++)
-            for (const char *leaf : {"ipaddr", "weight"}) {
-                ctl_reply reply;
-                if (!ask(ctl_walk::node, one.below(std::to_string(i)).below(leaf).text(), &reply))
-                    return false;
-                added.insert(added.end(), reply.bindings.begin(), reply.bindings.end());
-            }
+        if (!query_appliances(ask, one.text(), strtoul(count.value.c_str(), nullptr, 10), &added))
+            return false;
         const auto at = std::find_if(inout->begin(), inout->end(),
                                      [&](const ctl_binding &binding) { return binding.name == count.name; });
         inout->insert(at == inout->end() ? at : at + 1, added.begin(), added.end());

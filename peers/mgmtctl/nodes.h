@@ -23,6 +23,11 @@ std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &name);
 // Words that could stand in the place of a beginning: node names up to their next part, or NAME=VALUE.
 std::vector<std::string> completions(const ctl_ask &ask, const std::string &word);
 
+// wccpd answers for the appliances of a group by number only: the nodes "ipaddr" and "weight" of the first
+// `count` below `list` (".../51/appliance"), in their order, are appended to `inout`. False: no answer.
+constexpr unsigned long APPLIANCES_MAX = 32; // of a group
+bool query_appliances(const ctl_ask &ask, const std::string &list, unsigned long count,
+                      std::vector<ctl_binding> *inout);
 // A walk of wccpd's states leaves the appliances of a group out, since they are asked for by number: they are
 // asked for and put in their place. False: no answer.
 bool add_appliances(const ctl_ask &ask, const std::string &root, std::vector<ctl_binding> *inout);

@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <cstdio>
 
+#include <nlohmann/json.hpp>
 #include <unistd.h>
 
 #include "mgmt/node_paths.h"

@@ -1,15 +1,14 @@
-// What a person and what a script gets to see, and how a failure is told to either.
+// What a person and what a script gets to see, and how a failure is reported to either.
 #pragma once
 
 #include <string>
 #include <vector>
 
-#include <nlohmann/json.hpp>
+#include <nlohmann/json_fwd.hpp>
 
-#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/commands.h"
 
-using ctl_json = nlohmann::ordered_json;
+using ctl_json = nlohmann::ordered_json; // complete only where nlohmann/json.hpp is included
 
 // Standard output; a failure shows when the program ends.
 void put(const std::string &text);

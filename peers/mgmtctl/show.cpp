@@ -1,12 +1,12 @@
-// "mgmtctl show": one picture, or one that stays live.
+// "mgmtctl show": one snapshot, or one that stays live.
 //
-// A live picture is drawn anew each second and when mgmtd tells of something, at most ten times a second; a
-// picture that took long to gather leaves mgmtd and wccpd alone for longer than it took. On a terminal it has
-// the other screen and is written over in one piece; it gives the terminal back when a signal ends or stops
-// it. Below rows that are somebody else's it is a guest: it takes no screen, hides no cursor, and says where
-// each picture begins, since the other may have moved the cursor in between. In a file or a pipe it is a line
-// for whatever has changed, with the time, and as JSON a picture a line. When mgmtd goes, a live picture says
-// so and looks for it once a second.
+// A live snapshot is drawn anew each second and when mgmtd tells of something, at most ten times a second; a
+// snapshot that took long to gather leaves mgmtd and wccpd alone for longer than it took. On a terminal it
+// has the other screen and is written over in one piece; it gives the terminal back when a signal ends or
+// stops it. Below rows that are somebody else's it is a guest: it takes no screen, hides no cursor, and says
+// where each snapshot begins, since the other may have moved the cursor in between. In a file or a pipe it is
+// a line for whatever has changed, with the time, and as JSON a snapshot a line. When mgmtd goes, a live
+// snapshot says so and looks for it once a second.
 #include <algorithm>
 #include <cerrno>
 #include <clocale>
@@ -22,14 +22,15 @@
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/commands.h"
-#include "peers/mgmtctl/show_picture.h"
+#include "peers/mgmtctl/show_draw.h"
+#include "peers/mgmtctl/show_gather.h"
 #include "runtime/ttime.h"
 
 static constexpr int64_t PERIOD_MS = 1000;
 static constexpr int64_t BURST_MS = 100; // events within it are one
 static constexpr int FILE_COLUMNS = 120;
-static constexpr size_t PICTURE_BYTES = 1 << 16; // those of a large screen, with their colours
-static constexpr int GROUP_ROWS = 5; // of the least picture of a group that tells more than a line
+static constexpr size_t SCREEN_BYTES = 1 << 16; // those of a large screen, with their colours
+static constexpr int GROUP_ROWS = 5; // of the least snapshot of a group that tells more than a line
 
 static volatile std::sig_atomic_t pause_wanted;
 
@@ -66,8 +67,8 @@ static screen_form form_of(const viewer &self) {
     return form;
 }
 
-static picture_limits limits_of(const viewer &self) {
-    picture_limits limits;
+static snapshot_limits limits_of(const viewer &self) {
+    snapshot_limits limits;
     if (self.terminal && !self.options.json) {
         const auto rows = static_cast<size_t>(form_of(self).rows);
         limits.detailed = std::max<size_t>(rows / GROUP_ROWS, 1);
@@ -84,7 +85,7 @@ static void take_screen(viewer *self, bool take) {
     write_out(self, take ? "\033[?1049h\033[?25l" : "\033[0m\033[?25h\033[?1049l");
 }
 
-// --- One picture
+// --- One snapshot
 
 static std::string clock_text() {
     char text[16];
@@ -102,7 +103,7 @@ static std::string key_of(const std::string &line) {
     return line.starts_with("alarm ") ? line : "";
 }
 
-static void tell_changes(viewer *self, const picture &shown) {
+static void tell_changes(viewer *self, const snapshot &shown) {
     const std::vector<std::string> now = draw_lines(shown);
     const auto missing = [](const std::vector<std::string> &from, const std::string &line) {
         return std::find(from.begin(), from.end(), line) == from.end();
@@ -121,7 +122,7 @@ static void tell_changes(viewer *self, const picture &shown) {
     write_out(self, text);
 }
 
-static void show_one(viewer *self, const picture &shown) {
+static void show_one(viewer *self, const snapshot &shown) {
     if (self->options.json) {
         write_out(self, draw_json(shown) + "\n");
         return;
@@ -145,8 +146,8 @@ static void show_one(viewer *self, const picture &shown) {
     write_out(self, text);
 }
 
-static picture look(const viewer &self, ctl_session *session) {
-    return gather_picture(
+static snapshot look(const viewer &self, ctl_session *session) {
+    return gather_snapshot(
         [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
             return ctl_query(session, walk, name, out, out_reason);
         },
@@ -201,7 +202,7 @@ static bool add_interests(ctl_session *session, std::string *out_reason) {
     });
 }
 
-// Until it is time for the next picture, after one that cost so long. False: the session has ended.
+// Until it is time for the next snapshot, after one that cost so long. False: the session has ended.
 static bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reason) {
     const int64_t began = lt_monotonic_ms();
     int64_t until = began + std::max(PERIOD_MS, 4 * cost_ms);
@@ -222,9 +223,9 @@ static int watch(viewer *self) {
     ctl_session *session = nullptr;
     take_signals();
     if (self->terminal)
-        setvbuf(stdout, nullptr, _IOFBF, PICTURE_BYTES); // or each line is written by itself
+        setvbuf(stdout, nullptr, _IOFBF, SCREEN_BYTES); // or each line is written by itself
     while (!ctl_stop_signal && !self->broken) {
-        picture shown;
+        snapshot shown;
         if (!session) {
             session = ctl_open(self->options.timeout_ms, &shown.unreachable);
             if (session && !add_interests(session, &shown.unreachable)) {
@@ -263,7 +264,7 @@ int ctl_show(const ctl_options &options) {
     setlocale(LC_CTYPE, "");
     if (options.watch)
         return watch(&self);
-    picture shown;
+    snapshot shown;
     if (ctl_session *session = ctl_open(options.timeout_ms, &shown.unreachable)) {
         shown = look(self, session);
         ctl_close(session);

@@ -1,7 +1,7 @@
-// The picture for scripts. The keys are documented (docs/mgmtctl.md) and stay; what isn't known is null.
+// A snapshot for scripts. The keys are documented (docs/mgmtctl.md) and stay; what isn't known is null.
 #include <nlohmann/json.hpp>
 
-#include "peers/mgmtctl/show_picture.h"
+#include "peers/mgmtctl/show_draw.h"
 
 using json = nlohmann::ordered_json;
 
@@ -12,9 +12,9 @@ static json number_or_null(int64_t number) {
     return number < 0 ? json(nullptr) : json(number);
 }
 
-static json router_json(const picture_router &router) {
+static json router_json(const snapshot_router &router) {
     json shares = json::object();
-    for (const picture_load &load : router.loads)
+    for (const snapshot_load &load : router.loads)
         shares[load.appliance] = load.percent;
     return {{"address", router.address},
             {"id", router.id},
@@ -27,7 +27,7 @@ static json router_json(const picture_router &router) {
             {"shares", shares}};
 }
 
-static json appliance_json(const picture_appliance &one) {
+static json appliance_json(const snapshot_appliance &one) {
     json out = {{"address", one.address},
                 {"self", one.self},
                 {"weight", number_or_null(one.weight)},
@@ -38,7 +38,7 @@ static json appliance_json(const picture_appliance &one) {
 }
 
 // Buckets that follow one another and have one owner are one entry.
-static json table_json(const picture_group &group, const picture_table &table) {
+static json table_json(const snapshot_group &group, const snapshot_table &table) {
     json runs = json::array();
     for (size_t i = 0; i < table.owners.size(); i++) {
         const int owner = table.owners[i];
@@ -53,7 +53,7 @@ static json table_json(const picture_group &group, const picture_table &table) {
     return {{"kind", table.mask ? "mask" : "hash"}, {"routers", table.routers}, {"buckets", runs}};
 }
 
-static json group_json(const picture_group &group) {
+static json group_json(const snapshot_group &group) {
     json out = {{"id", group.id},
                 {"configured", group.configured},
                 {"admin", text_or_null(group.admin)},
@@ -72,18 +72,18 @@ static json group_json(const picture_group &group) {
                 {"address", text_or_null(group.address)},
                 {"link", text_or_null(group.link)}};
     out["routers"] = json::array();
-    for (const picture_router &router : group.routers)
+    for (const snapshot_router &router : group.routers)
         out["routers"].push_back(router_json(router));
     out["appliances"] = json::array();
-    for (const picture_appliance &one : group.appliances)
+    for (const snapshot_appliance &one : group.appliances)
         out["appliances"].push_back(appliance_json(one));
     out["tables"] = json::array();
-    for (const picture_table &table : group.tables)
+    for (const snapshot_table &table : group.tables)
         out["tables"].push_back(table_json(group, table));
     return out;
 }
 
-std::string draw_json(const picture &shown) {
+std::string draw_json(const snapshot &shown) {
     static const char *const conditions[] = {"running", "silent", "absent"};
     json out = {{"mgmtd", shown.unreachable.empty() ? "running" : "unreachable"}};
     if (!shown.unreachable.empty()) {
@@ -92,14 +92,15 @@ std::string draw_json(const picture &shown) {
     }
     out["wccpd"] = conditions[static_cast<int>(shown.wccpd)];
     out["status"] = text_or_null(shown.status);
+    out["version"] = text_or_null(shown.version);
     out["mode"] = text_or_null(shown.mode);
     out["groups_total"] = shown.groups_total;
     out["groups"] = json::array();
-    for (const picture_group &group : shown.groups)
+    for (const snapshot_group &group : shown.groups)
         out["groups"].push_back(group_json(group));
     out["alarms_total"] = shown.alarms_total;
     out["alarms"] = json::array();
-    for (const picture_alarm &alarm : shown.alarms)
+    for (const snapshot_alarm &alarm : shown.alarms)
         out["alarms"].push_back({{"type", alarm.type},
                                  {"name", alarm.name},
                                  {"group", number_or_null(alarm.group)},

@@ -1,4 +1,4 @@
-// The picture on a terminal, or in a file of plain lines.
+// The snapshot on a terminal, or in a file of plain lines.
 //
 // Colour says nothing that a letter or a word doesn't say too. Each appliance has a letter and a colour
 // within its group; the strip shows who has the buckets of a table, two halves in a cell where the terminal
@@ -12,7 +12,7 @@
 #include <cstdio>
 #include <cstring>
 
-#include "peers/mgmtctl/show_picture.h"
+#include "peers/mgmtctl/show_draw.h"
 
 static constexpr int STRIP_CELLS = 64;
 static constexpr int BAR_CELLS = 20;
@@ -68,7 +68,7 @@ static std::string format(const char *text, ...) {
     return buffer;
 }
 
-std::string duration_text(uint64_t milliseconds) {
+static std::string duration_text(uint64_t milliseconds) {
     const uint64_t seconds = milliseconds / 1000, days = seconds / 86400;
     const std::string days_text = days ? std::to_string(days) + "d " : "";
     return days_text + format("%" PRIu64 ":%02" PRIu64 ":%02" PRIu64, seconds / 3600 % 24, seconds / 60 % 60,
@@ -90,7 +90,7 @@ static std::string plural(size_t count, const char *what) {
 
 // --- Words
 
-static std::string alarm_words(const picture_alarm &alarm) {
+static std::string alarm_words(const snapshot_alarm &alarm) {
     static const struct {
         const char *name, *words;
     } known[] = {
@@ -104,16 +104,16 @@ static std::string alarm_words(const picture_alarm &alarm) {
     return alarm.since.empty() ? text : text + ", since " + alarm.since;
 }
 
-static bool in_alarm(const picture &shown, const picture_group &group) {
+static bool in_alarm(const snapshot &shown, const snapshot_group &group) {
     return std::any_of(shown.alarms.begin(), shown.alarms.end(),
-                       [&](const picture_alarm &alarm) { return alarm.group == group.id; });
+                       [&](const snapshot_alarm &alarm) { return alarm.group == group.id; });
 }
 
-static std::pair<std::string, style> state_words(const picture &shown, const picture_group &group) {
+static std::pair<std::string, style> state_words(const snapshot &shown, const snapshot_group &group) {
     if (group.admin == "down")
         return {"admin down", style::dim};
     if (!group.running)
-        return {shown.wccpd == picture_wccpd::running ? "not taken by wccpd" : "configured", style::warn};
+        return {shown.wccpd == wccpd_condition::running ? "not taken by wccpd" : "configured", style::warn};
     std::string text = group.state + (group.designated ? ", designated" : "");
     if (!group.configured)
         text += ", not configured";
@@ -122,13 +122,13 @@ static std::pair<std::string, style> state_words(const picture &shown, const pic
     return {text, group.state == "INIT" ? style::warn : style::good};
 }
 
-static const picture_appliance *own(const picture_group &group) {
+static const snapshot_appliance *own(const snapshot_group &group) {
     const auto self = std::find_if(group.appliances.begin(), group.appliances.end(),
-                                   [](const picture_appliance &one) { return one.self; });
+                                   [](const snapshot_appliance &one) { return one.self; });
     return self == group.appliances.end() ? nullptr : &*self;
 }
 
-static std::string share_words(const picture_appliance &one) {
+static std::string share_words(const snapshot_appliance &one) {
     if (!one.reported)
         return "-";
     std::string text = std::to_string(one.least_percent);
@@ -137,16 +137,16 @@ static std::string share_words(const picture_appliance &one) {
     return text + "%";
 }
 
-static size_t connected_routers(const picture_group &group) {
+static size_t connected_routers(const snapshot_group &group) {
     return static_cast<size_t>(std::count_if(group.routers.begin(), group.routers.end(),
                                              [](const auto &r) { return r.connection == "two-way"; }));
 }
 
-static std::string one_line(const picture_group &group, bool brief) {
+static std::string one_line(const snapshot_group &group, bool brief) {
     const size_t reached = brief ? group.routers_heard : connected_routers(group);
     const size_t all = brief ? std::max(group.routers_configured, reached) : group.routers.size();
     std::string text = "  routers " + std::to_string(reached) + "/" + std::to_string(all);
-    if (const picture_appliance *self = own(group)) {
+    if (const snapshot_appliance *self = own(group)) {
         text += "  share " + share_words(*self);
         if (self->asked_percent >= 0)
             text += " of " + std::to_string(self->asked_percent) + "%";
@@ -156,16 +156,16 @@ static std::string one_line(const picture_group &group, bool brief) {
     return text;
 }
 
-std::vector<std::string> draw_lines(const picture &shown) {
+std::vector<std::string> draw_lines(const snapshot &shown) {
     if (!shown.unreachable.empty())
         return {"mgmtd: " + shown.unreachable};
     std::vector<std::string> out;
-    if (shown.wccpd != picture_wccpd::running)
-        out.emplace_back(shown.wccpd == picture_wccpd::absent ? "wccpd is not running"
-                                                              : "wccpd does not answer");
-    for (const picture_alarm &alarm : shown.alarms)
+    if (shown.wccpd != wccpd_condition::running)
+        out.emplace_back(shown.wccpd == wccpd_condition::absent ? "wccpd is not running"
+                                                                : "wccpd does not answer");
+    for (const snapshot_alarm &alarm : shown.alarms)
         out.push_back("alarm  " + alarm_words(alarm));
-    for (const picture_group &group : shown.groups)
+    for (const snapshot_group &group : shown.groups)
         out.push_back("group " + std::to_string(group.id) + "  " + state_words(shown, group).first +
                       one_line(group, shown.brief));
     return out;
@@ -175,7 +175,7 @@ std::vector<std::string> draw_lines(const picture &shown) {
 
 namespace {
 struct screen {
-    const picture &shown;
+    const snapshot &shown;
     const screen_form &form;
     std::vector<std::string> lines;
 
@@ -189,24 +189,24 @@ struct screen {
 };
 } // namespace
 
-static std::string group_counts(const picture &shown) {
+static std::string group_counts(const snapshot &shown) {
     size_t active = shown.roles_active, backup = shown.roles_backup;
     if (!shown.brief) {
         active = backup = 0;
-        for (const picture_group &group : shown.groups) {
+        for (const snapshot_group &group : shown.groups) {
             active += group.state == "ACTIVE";
             backup += group.state == "BACKUP";
         }
     }
     std::string text = shown.groups_total == 0 ? "no group" : plural(shown.groups_total, "group");
-    if (shown.groups_total != 0 && shown.wccpd == picture_wccpd::running)
+    if (shown.groups_total != 0 && shown.wccpd == wccpd_condition::running)
         text += ": " + std::to_string(active) + " active" +
                 (backup ? ", " + std::to_string(backup) + " backup" : "");
     return text;
 }
 
 static void draw_head(screen *on, size_t alarms_most) {
-    const picture &shown = on->shown;
+    const snapshot &shown = on->shown;
     pen line = on->begin();
     if (!shown.unreachable.empty()) {
         add_cells(&line, "mgmtd: " + shown.unreachable, style::bad);
@@ -214,17 +214,20 @@ static void draw_head(screen *on, size_t alarms_most) {
         on->end(&line);
         return;
     }
-    if (shown.wccpd == picture_wccpd::running)
-        add_cells(&line, "wccpd " + (shown.status.empty() ? "runs" : shown.status), style::bold);
-    else
-        add_cells(&line,
-                  shown.wccpd == picture_wccpd::absent ? "wccpd is not running" : "wccpd does not answer",
-                  style::bad);
-    if (!shown.mode.empty())
-        add_cells(&line, "   mode " + shown.mode);
-    add_cells(&line, "   " + group_counts(shown) + "   ");
-    add_cells(&line, shown.alarms_total ? plural(shown.alarms_total, "alarm") : "no alarm",
-              shown.alarms_total ? style::bad : style::plain);
+    const bool running = shown.wccpd == wccpd_condition::running;
+    const std::string status = running ? "wccpd " + (shown.status.empty() ? "runs" : shown.status)
+                               : shown.wccpd == wccpd_condition::absent ? "wccpd is not running"
+                                                                        : "wccpd does not answer";
+    const std::string counts =
+        (shown.mode.empty() ? "" : "   mode " + shown.mode) + "   " + group_counts(shown) + "   ";
+    const std::string alarms = shown.alarms_total ? plural(shown.alarms_total, "alarm") : "no alarm";
+    const std::string version = shown.version.empty() ? "" : " (" + shown.version + ")";
+    add_cells(&line, status, running ? style::bold : style::bad);
+    if ((status + version + counts + alarms + on->form.corner).size() <=
+        static_cast<size_t>(on->form.columns))
+        add_cells(&line, version);
+    add_cells(&line, counts);
+    add_cells(&line, alarms, shown.alarms_total ? style::bad : style::plain);
     add_cells(&line, on->form.corner, style::dim);
     on->end(&line);
     const size_t told = std::min(shown.alarms.size(), alarms_most);
@@ -234,7 +237,7 @@ static void draw_head(screen *on, size_t alarms_most) {
         on->text("! " + plural(shown.alarms_total - told, "alarm") + (told ? " more" : ""), style::bad);
 }
 
-static void draw_group_head(screen *on, const picture_group &group) {
+static void draw_group_head(screen *on, const snapshot_group &group) {
     pen line = on->begin();
     add_cells(&line, format("%-4d", group.id), style::bold);
     const auto [words, how] = state_words(on->shown, group);
@@ -260,7 +263,7 @@ static void draw_group_head(screen *on, const picture_group &group) {
     on->end(&line);
 }
 
-static void draw_router(screen *on, const picture_router &router) {
+static void draw_router(screen *on, const snapshot_router &router) {
     const auto method = [](const std::string &word) { return word.empty() ? "-" : word.c_str(); };
     pen line = on->begin();
     add_cells(&line, format("  router %-15s ", router.address.c_str()));
@@ -278,7 +281,7 @@ static void draw_router(screen *on, const picture_router &router) {
     on->end(&line);
 }
 
-static void draw_bar(pen *line, const picture_appliance &one, int place) {
+static void draw_bar(pen *line, const snapshot_appliance &one, int place) {
     const int has = static_cast<int>(std::min<uint32_t>(one.least_percent, 100)) * BAR_CELLS;
     const int asked = std::clamp(one.asked_percent, 0, 100) * BAR_CELLS;
     set_style(line, "38;5;" + std::to_string(colour_of(place)));
@@ -296,7 +299,7 @@ static void draw_bar(pen *line, const picture_appliance &one, int place) {
     set_style(line, "0");
 }
 
-static void draw_appliance(screen *on, const picture_appliance &one, int place) {
+static void draw_appliance(screen *on, const snapshot_appliance &one, int place) {
     pen line = on->begin();
     add_cells(&line, "  ");
     set_style(&line, "1;38;5;" + std::to_string(colour_of(place)));
@@ -312,7 +315,7 @@ static void draw_appliance(screen *on, const picture_appliance &one, int place) 
     on->end(&line);
 }
 
-static void draw_strip(screen *on, const picture_group &group, const picture_table &table) {
+static void draw_strip(screen *on, const snapshot_group &group, const snapshot_table &table) {
     std::string label = table.mask ? "mask" : "hash";
     if (group.tables.size() > 1) // which of them
         label = table.routers[0] + (table.routers.size() > 1 ? " .." : "");
@@ -357,7 +360,7 @@ static void draw_more(screen *on, size_t all, size_t most, const char *what) {
         on->text("  and " + plural(all - most, what) + " more", style::dim);
 }
 
-static void draw_group(screen *on, const picture_group &group, size_t most) {
+static void draw_group(screen *on, const snapshot_group &group, size_t most) {
     draw_group_head(on, group);
     for (const size_t i :
          chosen(group.routers, most, [](const auto &r) { return r.connection != "two-way"; }))
@@ -371,10 +374,10 @@ static void draw_group(screen *on, const picture_group &group, size_t most) {
     draw_more(on, group.tables.size(), most, "table");
 }
 
-static std::vector<std::string> draw_whole(const picture &shown, const screen_form &form, size_t most) {
+static std::vector<std::string> draw_whole(const snapshot &shown, const screen_form &form, size_t most) {
     screen on = {shown, form, {}};
     draw_head(&on, most);
-    for (const picture_group &group : shown.groups) {
+    for (const snapshot_group &group : shown.groups) {
         on.text("");
         draw_group(&on, group, most);
     }
@@ -384,11 +387,11 @@ static std::vector<std::string> draw_whole(const picture &shown, const screen_fo
     return std::move(on.lines);
 }
 
-static std::vector<std::string> draw_briefly(const picture &shown, const screen_form &form) {
+static std::vector<std::string> draw_briefly(const snapshot &shown, const screen_form &form) {
     screen on = {shown, form, {}};
     draw_head(&on, 3);
     size_t told = 0;
-    for (const picture_group &group : shown.groups) {
+    for (const snapshot_group &group : shown.groups) {
         const size_t last = told + 1 < shown.groups_total ? 1 : 0; // the line that tells of the others
         if (form.rows > 0 && on.lines.size() + 1 + last > static_cast<size_t>(form.rows))
             break;
@@ -407,7 +410,7 @@ static std::vector<std::string> draw_briefly(const picture &shown, const screen_
     return std::move(on.lines);
 }
 
-std::vector<std::string> draw_screen(const picture &shown, const screen_form &form) {
+std::vector<std::string> draw_screen(const snapshot &shown, const screen_form &form) {
     if (!shown.brief)
         for (const size_t most : {size_t{256}, size_t{16}, size_t{8}, size_t{4}, size_t{2}, size_t{1}}) {
             std::vector<std::string> lines = draw_whole(shown, form, most);

@@ -12,6 +12,7 @@
 #include <ctime>
 #include <map>
 
+#include <nlohmann/json.hpp>
 #include <poll.h>
 #include <unistd.h>
 

@@ -11,5 +11,3 @@ std::string watch_pattern(const std::string &name);
 ctl_json json_event(const ctl_event &event, bool secrets);
 // Lines, without their time: one, or of a change one for each node.
 std::vector<std::string> text_event(const ctl_event &event, bool secrets);
-// The word of the command line. `count` 0: until the program is told to end.
-int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count);

@@ -1,15 +1,14 @@
-// Where mgmtd listens: clients of the session library go there by themselves, mgmtd binds it, mgmtctl names
-// it.
+// Where mgmtd listens: the session library connects there, mgmtd binds it, mgmtctl names it in messages.
 #pragma once
 
 #include <string>
 
-#include <unistd.h>
+#include <sys/un.h>
 
 #include "mgmt/gcl_wire.h"
-#include "runtime/common.h"
 
 inline std::string provider_path() {
-    const std::string user = lc_devel_is_production() ? "" : "UID-" + std::to_string(geteuid()) + "-";
-    return GCL_SOCKET_DIRECTORY + ("uds-provider-" + user) + "mgmtd";
+    char path[sizeof(sockaddr_un::sun_path)];
+    gcl_socket_path("provider", "mgmtd", path, sizeof path);
+    return path;
 }

@@ -107,7 +107,7 @@ const std::vector<schema_row> &schema() {
 const std::vector<const char *> &wccpd_state_nodes() {
     static const std::vector<const char *> nodes = {
         NODE_WCCPD_STATE "/proto_ver",
-        NODE_WCCPD_STATE "/version",
+        NODE_WCCPD_VERSION,
         NODE_WCCPD_STATUS,
         NODE_WCCPD_STATE "/debug_global",
         NODE_WCCPD_STATE "/debug_all",

@@ -11,7 +11,7 @@
 #include <map>
 #include <string_view>
 
-#include "peers/mgmtctl/show_picture.h"
+#include "peers/mgmtctl/show_texts.h"
 
 static constexpr size_t LINES_MAX = 8192;
 static constexpr size_t TABLES_MAX = 32; // of different routers
@@ -55,20 +55,20 @@ static bool words_in(std::string_view value, uint32_t *out) {
 
 namespace {
 struct assignment_reader {
-    picture_group *group;
+    snapshot_group *group;
     bool routers = false; // in the part of what they report
     std::string router;
     int place = -1;
     int words_at = -1; // where the next line of words goes, -1: nowhere
     bool mask = false;
-    std::map<std::string, picture_table> tables; // by router
+    std::map<std::string, snapshot_table> tables; // by router
 };
 } // namespace
 
 static void put_words(assignment_reader *in, const uint32_t *words) {
     if (in->place < 0 || (in->tables.size() >= TABLES_MAX && !in->tables.contains(in->router)))
         return;
-    picture_table *table = &in->tables[in->router];
+    snapshot_table *table = &in->tables[in->router];
     table->mask = in->mask;
     table->owners.resize(BUCKETS, -1);
     for (size_t i = 0; i < 128; i++) {
@@ -88,7 +88,7 @@ static void take_row(assignment_reader *in, const dump_row &row) {
     } else if (row.label == "Router id") {
         in->router = address_in(row.value);
     } else if (row.label == "Appliance ip") {
-        in->place = appliance_place(in->group, address_in(row.value));
+        in->place = place_of_appliance(in->group, address_in(row.value));
     } else if (row.label == "Hash/mask allotment" && !in->routers && in->place >= 0) {
         in->group->appliances[static_cast<size_t>(in->place)].asked_percent =
             std::clamp(atoi(std::string(row.value.substr(0, 8)).c_str()), 0, 100);
@@ -102,7 +102,7 @@ static void take_row(assignment_reader *in, const dump_row &row) {
 }
 
 // A mask table has as many values as its bits give: up to the last that has an owner, and a power of two.
-static void finish_table(picture_table *table) {
+static void finish_table(snapshot_table *table) {
     if (!table->mask)
         return;
     size_t count = table->owners.size();
@@ -111,18 +111,18 @@ static void finish_table(picture_table *table) {
     table->owners.resize(std::bit_ceil(count));
 }
 
-void take_assignment_text(const std::string &text, picture_group *inout) {
+void take_assignment_text(const std::string &text, snapshot_group *inout) {
     assignment_reader in = {.group = inout, .router = {}, .tables = {}};
     each_row(text, [&](const dump_row &row) { take_row(&in, row); });
     for (auto &reported : in.tables) {
         const std::string &router = reported.first;
-        picture_table &table = reported.second; // names of their own, for clang 14 lets no lambda see parts
+        snapshot_table &table = reported.second; // names of their own, for clang 14 lets no lambda see parts
         finish_table(&table);
         const bool owned =
             std::any_of(table.owners.begin(), table.owners.end(), [](int o) { return o >= 0; });
         if (!owned)
             continue;
-        auto same = std::find_if(inout->tables.begin(), inout->tables.end(), [&](const picture_table &t) {
+        auto same = std::find_if(inout->tables.begin(), inout->tables.end(), [&](const snapshot_table &t) {
             return t.mask == table.mask && t.owners == table.owners;
         });
         if (same == inout->tables.end())
@@ -131,7 +131,7 @@ void take_assignment_text(const std::string &text, picture_group *inout) {
     }
 }
 
-void take_group_text(const std::string &text, picture_group *inout) {
+void take_group_text(const std::string &text, snapshot_group *inout) {
     bool first = true;
     each_row(text, [&](const dump_row &row) {
         if (!first)

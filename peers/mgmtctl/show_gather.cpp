@@ -1,13 +1,15 @@
-// Gathering the picture: what wccpd's monitoring nodes, mgmtd's alarms and roles, and the configuration say.
+// A snapshot is gathered from wccpd's monitoring nodes, from mgmtd's alarms and roles, and from the
+// configuration.
 //
 // A group costs a walk of its nodes (its texts among them), one of its routers with their appliances, one of
 // its configuration, and two queries for each appliance, whose numbers cannot be walked. wccpd answers node
-// by node under its engine lock; so when more groups stand than a screen has room for, each comes briefly,
-// with six nodes: the share is then that at its first router. The number of queries has an end in any case.
+// by node under its engine lock. Therefore, when there are more groups than a screen has room for, each is
+// gathered briefly, from six nodes, and its share is the one at its first router. The number of queries is
+// bounded in any case.
 //
 // Each answer shows its own moment. A group, router or appliance that is gone by the time it is asked for
-// just has no nodes, and is left out. Once wccpd has not answered, it is not asked again for this picture.
-#include "peers/mgmtctl/show_picture.h"
+// has no nodes and is left out. Once wccpd has not answered, it is not asked again for this snapshot.
+#include "peers/mgmtctl/show_gather.h"
 
 #include <algorithm>
 #include <charconv>
@@ -15,30 +17,12 @@
 #include <arpa/inet.h>
 
 #include "mgmt/node_paths.h"
+#include "peers/mgmtctl/nodes.h"
 #include "peers/mgmtctl/render.h"
+#include "peers/mgmtctl/show_texts.h"
 #include "runtime/common.h"
 
 static constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
-static constexpr size_t APPLIANCES_MAX = 32;
-
-std::string clean_text(const std::string &text, size_t most) {
-    std::string out = text.substr(0, most);
-    for (char &c : out)
-        if (c < 0x20 || c > 0x7e)
-            c = '?';
-    return out;
-}
-
-int appliance_place(picture_group *inout, const std::string &address) {
-    for (size_t i = 0; i < inout->appliances.size(); i++)
-        if (inout->appliances[i].address == address)
-            return static_cast<int>(i);
-    if (address.empty() || inout->appliances.size() >= APPLIANCES_MAX)
-        return -1;
-    inout->appliances.emplace_back().address = address;
-    inout->appliances.back().self = address == inout->address;
-    return static_cast<int>(inout->appliances.size() - 1);
-}
 
 template <typename Number>
 static Number number_of(const std::string &text, Number otherwise) {
@@ -47,28 +31,19 @@ static Number number_of(const std::string &text, Number otherwise) {
     return out;
 }
 
-// The parts of a name below `root`, a "\/" in them read as "/"; none for a name that isn't below it.
+// The parts of a name below `root`; none for a name that isn't below it.
 static std::vector<std::string> parts_below(const std::string &root, const std::string &name) {
-    std::vector<std::string> out;
-    if (!name.starts_with(root + "/"))
-        return out;
-    out.emplace_back();
-    for (size_t i = root.size() + 1; i < name.size(); i++) {
-        if (name[i] == '\\' && i + 1 < name.size() && (name[i + 1] == '/' || name[i + 1] == '\\'))
-            out.back() += name[++i];
-        else if (name[i] == '/')
-            out.emplace_back();
-        else
-            out.back() += name[i];
-    }
-    return out;
+    node_name above, whole;
+    if (!parse_node_name(root, &above) || !parse_node_name(name, &whole) || !whole.is_under(above))
+        return {};
+    return {whole.parts.begin() + static_cast<std::ptrdiff_t>(above.parts.size()), whole.parts.end()};
 }
 
 namespace {
 struct gathering {
-    const picture_query &query;
-    const picture_limits &limits;
-    picture shown;
+    const snapshot_query &query;
+    const snapshot_limits &limits;
+    snapshot shown;
     size_t queries = 0;
 
     // False ends the whole: there is no answer any more.
@@ -85,14 +60,14 @@ struct gathering {
     // The same of wccpd's nodes; nothing comes once it doesn't answer.
     bool ask_wccpd(ctl_walk walk, const std::string &name, ctl_reply *out) {
         *out = {};
-        if (shown.wccpd != picture_wccpd::running)
+        if (shown.wccpd != wccpd_condition::running)
             return true;
         if (!ask(walk, name, out))
             return false;
         if (out->code == LC_IO_CLOSED)
-            shown.wccpd = picture_wccpd::absent;
+            shown.wccpd = wccpd_condition::absent;
         else if (out->code == LC_IO_TIMED_OUT)
-            shown.wccpd = picture_wccpd::silent;
+            shown.wccpd = wccpd_condition::silent;
         return true;
     }
 };
@@ -120,45 +95,45 @@ static std::string method_word(const std::string &value) {
     return out.starts_with("not") ? "" : out;
 }
 
-static const node_row<picture_router> router_rows[] = {
+static const node_row<snapshot_router> router_rows[] = {
     {"state",
-     [](picture_router *r, const std::string &v) {
+     [](snapshot_router *r, const std::string &v) {
          r->connection = v.starts_with("TWO-WAY")   ? "two-way"
                          : v.starts_with("ONE-WAY") ? "one-way"
                                                     : "unknown";
      }},
-    {"fwd_method", [](picture_router *r, const std::string &v) { r->forward = method_word(v); }},
-    {"assign_method", [](picture_router *r, const std::string &v) { r->assign = method_word(v); }},
-    {"ret_method", [](picture_router *r, const std::string &v) { r->back = method_word(v); }},
-    {"id", [](picture_router *r, const std::string &v) { r->id = clean_text(v, 15); }},
-    {"ipaddr", [](picture_router *r, const std::string &v) { r->address = clean_text(v, 15); }},
+    {"fwd_method", [](snapshot_router *r, const std::string &v) { r->forward = method_word(v); }},
+    {"assign_method", [](snapshot_router *r, const std::string &v) { r->assign = method_word(v); }},
+    {"ret_method", [](snapshot_router *r, const std::string &v) { r->back = method_word(v); }},
+    {"id", [](snapshot_router *r, const std::string &v) { r->id = clean_text(v, 15); }},
+    {"ipaddr", [](snapshot_router *r, const std::string &v) { r->address = clean_text(v, 15); }},
     {"conn_time",
-     [](picture_router *r, const std::string &v) { r->connected_ms = number_of<uint64_t>(v, 0); }},
+     [](snapshot_router *r, const std::string &v) { r->connected_ms = number_of<uint64_t>(v, 0); }},
 };
 
-static const node_row<picture_group> group_rows[] = {
+static const node_row<snapshot_group> group_rows[] = {
     {"oper",
-     [](picture_group *g, const std::string &v) {
+     [](snapshot_group *g, const std::string &v) {
          g->running = true;
          g->state = clean_text(v.substr(0, v.find(',')), 16);
          g->designated = v.ends_with(", DESIGNATED");
      }},
-    {"uptime", [](picture_group *g, const std::string &v) { g->uptime_ms = number_of<uint64_t>(v, 0); }},
-    {"app_id", [](picture_group *g, const std::string &v) { g->address = clean_text(v, 15); }},
+    {"uptime", [](snapshot_group *g, const std::string &v) { g->uptime_ms = number_of<uint64_t>(v, 0); }},
+    {"app_id", [](snapshot_group *g, const std::string &v) { g->address = clean_text(v, 15); }},
     {"num_routers",
-     [](picture_group *g, const std::string &v) { g->routers_heard = number_of<size_t>(v, 0); }},
+     [](snapshot_group *g, const std::string &v) { g->routers_heard = number_of<size_t>(v, 0); }},
 };
 
-static const node_row<picture_group> config_rows[] = {
-    {"interface", [](picture_group *g, const std::string &v) { g->interface = clean_text(v, 15); }},
-    {"admin", [](picture_group *g, const std::string &v) { g->admin = clean_text(v, 15); }},
-    {"protocol", [](picture_group *g, const std::string &v) { g->protocol = clean_text(v, 31); }},
-    {"encap", [](picture_group *g, const std::string &v) { g->encap = clean_text(v, 15); }},
-    {"assign_method", [](picture_group *g, const std::string &v) { g->assign_method = clean_text(v, 15); }},
-    {"password", [](picture_group *g, const std::string &v) { g->authenticated = !v.empty(); }},
-    {"weight", [](picture_group *g, const std::string &v) { g->weight = number_of<int64_t>(v, -1); }},
-    {"priority", [](picture_group *g, const std::string &v) { g->priority = number_of<int64_t>(v, -1); }},
-    {"policy_grp", [](picture_group *g, const std::string &v) { g->policy = number_of<int64_t>(v, -1); }},
+static const node_row<snapshot_group> config_rows[] = {
+    {"interface", [](snapshot_group *g, const std::string &v) { g->interface = clean_text(v, 15); }},
+    {"admin", [](snapshot_group *g, const std::string &v) { g->admin = clean_text(v, 15); }},
+    {"protocol", [](snapshot_group *g, const std::string &v) { g->protocol = clean_text(v, 31); }},
+    {"encap", [](snapshot_group *g, const std::string &v) { g->encap = clean_text(v, 15); }},
+    {"assign_method", [](snapshot_group *g, const std::string &v) { g->assign_method = clean_text(v, 15); }},
+    {"password", [](snapshot_group *g, const std::string &v) { g->authenticated = !v.empty(); }},
+    {"weight", [](snapshot_group *g, const std::string &v) { g->weight = number_of<int64_t>(v, -1); }},
+    {"priority", [](snapshot_group *g, const std::string &v) { g->priority = number_of<int64_t>(v, -1); }},
+    {"policy_grp", [](snapshot_group *g, const std::string &v) { g->policy = number_of<int64_t>(v, -1); }},
 };
 
 static std::string group_root(const char *above, int id) {
@@ -166,7 +141,7 @@ static std::string group_root(const char *above, int id) {
 }
 
 // What is configured; the addresses of its routers go to `out_routers`.
-static bool gather_config(gathering *work, picture_group *group, std::vector<std::string> *out_routers) {
+static bool gather_config(gathering *work, snapshot_group *group, std::vector<std::string> *out_routers) {
     ctl_reply reply;
     const std::string root = group_root(NODE_GROUP_CONFIG, group->id);
     if (!work->ask(ctl_walk::subtree, root, &reply))
@@ -182,16 +157,16 @@ static bool gather_config(gathering *work, picture_group *group, std::vector<std
     return true;
 }
 
-static void take_load(picture_group *group, picture_router *router, const std::string &address,
+static void take_load(snapshot_group *group, snapshot_router *router, const std::string &address,
                       const std::string &value) {
     if (router->loads.size() >= APPLIANCES_MAX)
         return;
-    const picture_load load = {clean_text(address, 15), number_of<uint32_t>(value, 0)};
+    const snapshot_load load = {clean_text(address, 15), number_of<uint32_t>(value, 0)};
     router->loads.push_back(load);
-    const int place = appliance_place(group, load.appliance);
+    const int place = place_of_appliance(group, load.appliance);
     if (place < 0)
         return;
-    picture_appliance *one = &group->appliances[static_cast<size_t>(place)];
+    snapshot_appliance *one = &group->appliances[static_cast<size_t>(place)];
     one->least_percent = one->reported ? std::min(one->least_percent, load.percent) : load.percent;
     one->most_percent = std::max(one->most_percent, load.percent);
     one->reported = true;
@@ -202,7 +177,7 @@ static uint32_t address_order(const std::string &address) {
     return inet_pton(AF_INET, address.c_str(), &parsed) == 1 ? ntohl(parsed.s_addr) : 0;
 }
 
-static bool gather_routers(gathering *work, picture_group *group,
+static bool gather_routers(gathering *work, snapshot_group *group,
                            const std::vector<std::string> &configured) {
     ctl_reply reply;
     const std::string root = group_root(NODE_GROUP_STATE, group->id) + "/router";
@@ -230,12 +205,12 @@ static bool gather_routers(gathering *work, picture_group *group,
     });
     for (const std::string &address : configured) {
         const auto heard = std::find_if(group->routers.begin(), group->routers.end(),
-                                        [&](const picture_router &r) { return r.address == address; });
+                                        [&](const snapshot_router &r) { return r.address == address; });
         // A multicast address is where routers are looked for, and none itself.
         if (heard != group->routers.end()) {
             heard->configured = true;
         } else if (const int first = number_of(address, 0); first < 224 || group->routers.empty()) {
-            picture_router silent;
+            snapshot_router silent;
             silent.address = silent.id = address;
             silent.configured = true;
             silent.connection = "none";
@@ -245,47 +220,49 @@ static bool gather_routers(gathering *work, picture_group *group,
     return true;
 }
 
-static bool gather_weights(gathering *work, picture_group *group, uint32_t count) {
-    for (uint32_t n = 1; n <= std::min<uint32_t>(count, APPLIANCES_MAX); n++) {
-        const std::string root = group_root(NODE_GROUP_STATE, group->id) + "/appliance/" + std::to_string(n);
-        ctl_reply address, weight;
-        if (!work->ask_wccpd(ctl_walk::node, root + "/ipaddr", &address) ||
-            !work->ask_wccpd(ctl_walk::node, root + "/weight", &weight))
-            return false;
-        if (address.bindings.empty() || weight.bindings.empty() || address.bindings[0].value == "0.0.0.0")
+static bool gather_weights(gathering *work, snapshot_group *group, uint32_t count) {
+    const ctl_ask ask = [work](ctl_walk walk, const std::string &name, ctl_reply *out) {
+        return work->ask_wccpd(walk, name, out);
+    };
+    std::vector<ctl_binding> found;
+    if (!query_appliances(ask, group_root(NODE_GROUP_STATE, group->id) + "/appliance", count, &found))
+        return false;
+    for (size_t i = 0; i + 1 < found.size(); i++) {
+        const ctl_binding &address = found[i], &weight = found[i + 1];
+        if (!address.name.ends_with("/ipaddr") || !weight.name.ends_with("/weight") ||
+            address.value == "0.0.0.0")
             continue;
-        const int place = appliance_place(group, clean_text(address.bindings[0].value, 15));
+        const int place = place_of_appliance(group, clean_text(address.value, 15));
         if (place >= 0)
-            group->appliances[static_cast<size_t>(place)].weight =
-                number_of<int64_t>(weight.bindings[0].value, -1);
+            group->appliances[static_cast<size_t>(place)].weight = number_of<int64_t>(weight.value, -1);
     }
     return true;
 }
 
 // Where the designated appliance doesn't tell what it allots, the weights do.
-static void finish_shares(picture_group *group) {
+static void finish_shares(snapshot_group *group) {
     int64_t sum = 0;
     bool known = !group->appliances.empty();
-    for (const picture_appliance &one : group->appliances) {
+    for (const snapshot_appliance &one : group->appliances) {
         known = known && one.weight >= 0 && one.asked_percent < 0;
         sum += std::max<int64_t>(one.weight, 0);
     }
-    for (picture_appliance &one : group->appliances)
+    for (snapshot_appliance &one : group->appliances)
         if (known && sum > 0)
             one.asked_percent = static_cast<int>((one.weight * 100 + sum / 2) / sum);
 }
 
 // By address: an appliance keeps its letter and its place while others come and go.
-static void sort_appliances(picture_group *group) {
-    std::vector<picture_appliance> sorted = group->appliances;
+static void sort_appliances(snapshot_group *group) {
+    std::vector<snapshot_appliance> sorted = group->appliances;
     std::sort(sorted.begin(), sorted.end(), [](const auto &a, const auto &b) {
         return address_order(a.address) < address_order(b.address);
     });
     group->appliances.swap(sorted);
-    for (picture_table &table : group->tables)
+    for (snapshot_table &table : group->tables)
         for (int &owner : table.owners)
             if (owner >= 0)
-                owner = appliance_place(group, sorted[static_cast<size_t>(owner)].address);
+                owner = place_of_appliance(group, sorted[static_cast<size_t>(owner)].address);
 }
 
 namespace {
@@ -295,7 +272,7 @@ struct group_texts {
 };
 } // namespace
 
-static void take_group_nodes(const std::string &root, const ctl_reply &reply, picture_group *group,
+static void take_group_nodes(const std::string &root, const ctl_reply &reply, snapshot_group *group,
                              group_texts *out) {
     for (const ctl_binding &binding : reply.bindings) {
         const std::vector<std::string> parts = parts_below(root, binding.name);
@@ -311,7 +288,7 @@ static void take_group_nodes(const std::string &root, const ctl_reply &reply, pi
     }
 }
 
-static bool gather_briefly(gathering *work, picture_group *group, const std::string &root) {
+static bool gather_briefly(gathering *work, snapshot_group *group, const std::string &root) {
     ctl_reply reply;
     group_texts unused;
     for (const char *node : {"/oper", "/uptime", "/app_id", "/num_routers"}) {
@@ -325,13 +302,13 @@ static bool gather_briefly(gathering *work, picture_group *group, const std::str
                          &reply))
         return false;
     if (!reply.bindings.empty()) {
-        picture_router first;
+        snapshot_router first;
         take_load(group, &first, group->address, reply.bindings[0].value);
     }
     return true;
 }
 
-static bool gather_group(gathering *work, picture_group *group, bool in_wccpd) {
+static bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) {
     std::vector<std::string> configured;
     if (group->configured && !gather_config(work, group, &configured))
         return false;
@@ -392,15 +369,17 @@ static void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *
 }
 
 static void gather(gathering *work) {
-    ctl_reply alive, mode, states, configs;
-    work->shown.wccpd = picture_wccpd::running;
+    ctl_reply alive, version, mode, states, configs;
+    work->shown.wccpd = wccpd_condition::running;
     if (!work->ask(ctl_walk::node, NODE_SYSTEM_MODE, &mode) || !gather_alarms(work) ||
         !work->ask(ctl_walk::children, NODE_GROUP_CONFIG, &configs) ||
         !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_STATUS, &alive) ||
+        !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_VERSION, &version) ||
         !work->ask_wccpd(ctl_walk::children, NODE_GROUP_STATE, &states))
         return;
     work->shown.mode = first_value(mode);
     work->shown.status = first_value(alive);
+    work->shown.version = first_value(version);
     std::vector<int> configured, running, all;
     add_ids(NODE_GROUP_CONFIG, configs, &configured);
     add_ids(NODE_GROUP_STATE, states, &running);
@@ -412,7 +391,7 @@ static void gather(gathering *work) {
         if (work->queries >= work->limits.queries ||
             (work->shown.brief && work->shown.groups.size() >= work->limits.listed))
             return;
-        picture_group group;
+        snapshot_group group;
         group.id = id;
         group.configured = std::binary_search(configured.begin(), configured.end(), id);
         if (!gather_group(work, &group, std::binary_search(running.begin(), running.end(), id)))
@@ -421,7 +400,7 @@ static void gather(gathering *work) {
     }
 }
 
-picture gather_picture(const picture_query &query, const picture_limits &limits) {
+snapshot gather_snapshot(const snapshot_query &query, const snapshot_limits &limits) {
     gathering work = {query, limits, {}, 0};
     gather(&work);
     return std::move(work.shown);

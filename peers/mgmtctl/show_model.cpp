@@ -1,0 +1,22 @@
+#include "peers/mgmtctl/show_model.h"
+
+#include "peers/mgmtctl/nodes.h"
+
+std::string clean_text(const std::string &text, size_t most) {
+    std::string out = text.substr(0, most);
+    for (char &c : out)
+        if (c < 0x20 || c > 0x7e)
+            c = '?';
+    return out;
+}
+
+int place_of_appliance(snapshot_group *inout, const std::string &address) {
+    for (size_t i = 0; i < inout->appliances.size(); i++)
+        if (inout->appliances[i].address == address)
+            return static_cast<int>(i);
+    if (address.empty() || inout->appliances.size() >= APPLIANCES_MAX)
+        return -1;
+    inout->appliances.emplace_back().address = address;
+    inout->appliances.back().self = address == inout->address;
+    return static_cast<int>(inout->appliances.size() - 1);
+}

@@ -1,0 +1,79 @@
+// The state of the appliance at one moment, as "mgmtctl show" gathers it (show_gather.h) and draws it
+// (show_draw.h).
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+// All texts are cleaned: printable ASCII of bounded length.
+struct snapshot_load {
+    std::string appliance;
+    uint32_t percent = 0; // of the router's assignment
+};
+struct snapshot_router {
+    std::string address; // that it speaks from, or that is configured for it
+    std::string id;
+    bool configured = false;
+    std::string connection; // "two-way", "one-way", "unknown"; "none": nothing is heard
+    uint64_t connected_ms = 0;
+    std::string forward, assign, back; // "gre", "l2", "hash", "mask"; empty as long as nothing is agreed
+    std::vector<snapshot_load> loads;
+};
+struct snapshot_appliance {
+    std::string address;
+    bool self = false;
+    int64_t weight = -1;                          // -1: unknown
+    int asked_percent = -1;                       // what the weights, or the designated appliance, give it
+    bool reported = false;                        // by a router, its share
+    uint32_t least_percent = 0, most_percent = 0; // over the routers
+};
+// Which appliance has which bucket or mask value, as routers report it.
+struct snapshot_table {
+    bool mask = false;
+    std::vector<std::string> routers; // that report this very table, by their ids
+    std::vector<int> owners; // places in the group's appliances, -1 for nobody; a power of two of them
+};
+struct snapshot_alarm {
+    long type = 0;
+    std::string name; // "adjacency", "assignment"
+    std::string source, text, since, reporter;
+    int group = -1;
+};
+struct snapshot_group {
+    int id = 0;
+    // What is configured.
+    bool configured = false;
+    std::string interface, admin, protocol, encap, assign_method;
+    bool authenticated = false;
+    int64_t weight = -1, priority = -1, policy = -1;
+    // What wccpd has.
+    bool running = false;
+    std::string state; // "ACTIVE", "BACKUP", "INIT"
+    bool designated = false;
+    uint64_t uptime_ms = 0;
+    std::string address; // of this appliance in the group
+    std::string link;    // of its first interface: "up", "down"; empty: unknown
+    size_t routers_configured = 0, routers_heard = 0;
+    std::vector<snapshot_router> routers;
+    std::vector<snapshot_appliance> appliances;
+    std::vector<snapshot_table> tables;
+};
+enum class wccpd_condition { running, silent, absent };
+struct snapshot {
+    std::string unreachable; // why there is nothing of mgmtd; the rest is empty then
+    wccpd_condition wccpd = wccpd_condition::absent;
+    std::string status, version, mode; // of the daemon, twice; of the system
+    std::vector<snapshot_group> groups;
+    size_t groups_total = 0;
+    bool brief = false; // groups without routers, weights, tables and link, and with the own share alone
+    size_t roles_active = 0, roles_backup = 0;
+    std::vector<snapshot_alarm> alarms;
+    size_t alarms_total = 0;
+};
+
+// The text cut to `most` characters, everything but printable ASCII replaced.
+std::string clean_text(const std::string &text, size_t most);
+// The place of the appliance, which is added when it is new; -1 when there are too many.
+int place_of_appliance(snapshot_group *inout, const std::string &address);
