@@ -11,6 +11,7 @@
 
 #include <algorithm>
 #include <cstring>
+#include <new>
 
 #include "mgmt/bnode.h"
 #include "mgmt/node_paths.h"
@@ -164,17 +165,14 @@ std::strong_ordering operator<=>(const node_name &a, const node_name &b) {
 }
 
 std::string node_name::text() const {
-    std::string out;
-    for (const std::string &part : parts) {
-        out += '/';
-        for (size_t i = 0; i < part.size(); i++) {
-            const bool before_special = i + 1 < part.size() && (part[i + 1] == '/' || part[i + 1] == '\\');
-            if (part[i] == '/' || (part[i] == '\\' && before_special))
-                out += '\\';
-            out += part[i];
-        }
-    }
-    return out;
+    owned_tstr_array joined;
+    owned_text name;
+    lc_status status = tstr_array_new(&joined.pointer, nullptr);
+    for (size_t i = 0; i < parts.size() && status == LC_OK; i++)
+        status = tstr_array_append_str(joined.pointer, parts[i].c_str());
+    if (status != LC_OK || bn_binding_name_parts_to_name(joined.pointer, 1, &name.pointer) != LC_OK)
+        throw std::bad_alloc();
+    return name.pointer;
 }
 
 bool node_name::is_under(const node_name &above) const {
