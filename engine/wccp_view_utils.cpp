@@ -1,21 +1,21 @@
-// Views: what the routers of a group report of routers and appliances, and what they assign to this
-// appliance.
+// Views: which routers and appliances the routers of a group report, and what they assign to this appliance.
 //
-// There are two levels. Each sending router keeps its last report as arrays (view_routers, view_appliances);
-// the group keeps the union over all of them as lists (router_view, appliance_view), whose entries count the
-// array entries that name them. A report is compared with the one before it, what is new or gone moves the
-// union, and any such move raises the change number and asks for an election at the next tick. The union's
-// entries are made by the report that first names them and freed with their last mention; nobody keeps a
-// pointer to one.
+// There are two levels. Each sending router keeps its last report as arrays (view_routers, view_appliances).
+// The group keeps the union over all of them as lists (router_view, appliance_view), in which the reference
+// count of an entry is the number of sending routers that report it. A new report is compared with the
+// router's last one: what is new takes a reference in the union, what is gone gives its reference back, and
+// any such change raises the change number and asks for an election at the next tick. The first reference
+// creates an entry, the last one frees it, and nobody keeps a pointer to an entry.
+//
+// An array holds exactly those addresses for which its router has a reference. Otherwise a reference would
+// outlive its router, and an appliance that nobody reports any more could keep the group from ever electing a
+// designated appliance. Therefore an address that occurs again in the same report is skipped, and a report is
+// always taken to its end: an address for which there was no memory stays out of the array, so that the next
+// report finds it new and tries again. A failure on the way is returned at the end.
 //
 // The engine lock is held throughout, by a receive thread, or by the timer thread when a silent router is
-// taken out. In steady state a report repeats the one before it, entry by entry, and costs a comparison and a
-// copy. Otherwise an address is looked for at its old place first, and only then anywhere else.
-//
-// A report may name an address more than once. Each mention is matched with an old mention of its own, so
-// that the union's counts and the arrays stay in step whatever follows; and this appliance counts as lost
-// only when no mention of it is left. An update that fails in the middle leaves the router's arrays as they
-// were, so that the next report is compared with the last complete one.
+// removed. In steady state a report equals the one before it, entry by entry, and costs a comparison and a
+// copy. Otherwise an address is looked for at its old position first, then everywhere.
 //
 // The role of this appliance follows from what one router assigned before and assigns now: take_redirection
 // at the end of this file.
@@ -62,9 +62,10 @@ int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_app
     return 0;
 }
 
-// Takes one mention from an entry of a union, and the entry with the last one. False when there is none.
+// Gives one reference on an entry of a union back, and frees the entry with the last one. False when there is
+// no entry of that address.
 template <typename Entry>
-static bool drop_mention(Entry *first, uint32_t *count, be32 address) {
+static bool drop_reference(Entry *first, uint32_t *count, be32 address) {
     Entry *entry = find_in_union(first, address);
     if (!entry)
         return false;
@@ -77,7 +78,7 @@ static bool drop_mention(Entry *first, uint32_t *count, be32 address) {
 }
 
 int wccp_remove_router_from_view_list(wccp_service_group *group, be32 address) {
-    if (drop_mention(group->router_view, &group->router_view_count, address))
+    if (drop_reference(group->router_view, &group->router_view_count, address))
         return 0;
     QV_LOG(LC_LOG_ERR,
            "WCCP GRP %d: removal of router failed. entry not found in router view list. router ip  %s",
@@ -86,7 +87,7 @@ int wccp_remove_router_from_view_list(wccp_service_group *group, be32 address) {
 }
 
 int wccp_remove_appliance_from_view_list(wccp_service_group *group, be32 address) {
-    if (drop_mention(group->appliance_view, &group->appliance_view_count, address))
+    if (drop_reference(group->appliance_view, &group->appliance_view_count, address))
         return 0;
     QV_LOG(LC_LOG_ERR,
            "WCCP GRP %d: appliance remove failed. entry not found in appliance list. appliance ip %s",
@@ -101,22 +102,38 @@ static void view_has_changed(wccp_service_group *group, const wccp_sending_route
            group->id, what, addr_text(router->router_id).s, static_cast<int>(group->change_number));
 }
 
-// The old mention that a new one at position `place` is matched with: marked, or null when there is none.
-template <typename Entry>
-static Entry *mark_old_mention(Entry *old, uint32_t count, uint32_t place, be32 address) {
-    const auto matches = [address](const Entry &entry) {
-        return entry.ipa == address && !(entry.flags & MARK);
-    };
-    if (place < count && matches(old[place])) {
-        old[place].flags |= MARK;
-        return &old[place];
-    }
+// The reports.
+
+static be32 address_of(be32 address) {
+    return address;
+}
+static be32 address_of(const wccp_rtr_view_appliance &element) {
+    return element.ipa;
+}
+
+// Bit i is set when no item of the report before item i has the same address.
+template <typename Item>
+static uint32_t first_occurrences(const Item *items, uint32_t count) {
+    static_assert(WCCP_MAX_ROUTERS <= 32 && WCCP_MAX_APPLIANCES <= 32);
+    uint32_t bits = 0;
     for (uint32_t i = 0; i < count; i++) {
-        if (matches(old[i])) {
-            old[i].flags |= MARK;
-            return &old[i];
-        }
+        uint32_t earlier = 0;
+        while (earlier < i && !(address_of(items[earlier]) == address_of(items[i])))
+            earlier++;
+        if (earlier == i)
+            bits |= 1u << i;
     }
+    return bits;
+}
+
+// The entry of an address in the last report, or null. `place` is where the new report has it.
+template <typename Entry>
+static Entry *find_in_report(Entry *entries, uint32_t count, uint32_t place, be32 address) {
+    if (place < count && entries[place].ipa == address)
+        return &entries[place];
+    for (uint32_t i = 0; i < count; i++)
+        if (entries[i].ipa == address)
+            return &entries[i];
     return nullptr;
 }
 
@@ -126,7 +143,7 @@ static void clear_marks(Entry *old, uint32_t count) {
         old[i].flags &= ~MARK;
 }
 
-// What a comparison leaves when each new mention is found. The marks show in a dump.
+// What a comparison leaves when every address of the report is known. A dump shows the marks.
 template <typename Entry>
 static void mark_all(Entry *old, uint32_t count) {
     for (uint32_t i = 0; i < count; i++)
@@ -135,21 +152,22 @@ static void mark_all(Entry *old, uint32_t count) {
 
 // Routers.
 
-static int add_router_mention(wccp_service_group *group, be32 address) {
+// Takes a reference on the union's entry of a router. False when memory is out.
+static bool hold_router(wccp_service_group *group, be32 address) {
     wccp_view_router *entry = find_in_union(group->router_view, address);
     if (!entry) {
         entry = static_cast<wccp_view_router *>(wccp_malloc(sizeof *entry));
         if (!entry) {
             QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding router view failed. out of memory. router ipa %s",
                    group->id, addr_text(address).s);
-            return 1;
+            return false;
         }
         entry->ipa = address;
         group->router_view_count++;
         list_push_head(&group->router_view, entry);
     }
     entry->ref_count++;
-    return 0;
+    return true;
 }
 
 static bool repeats_last_report(const wccp_sending_router *router, uint32_t count, const be32 *addresses) {
@@ -170,14 +188,21 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
         return 0;
     }
     const uint32_t old_count = router->view_router_count;
+    uint32_t taken = first_occurrences(addresses, count);
     bool changed = false;
+    int status = 0;
     clear_marks(router->view_routers, old_count);
     for (uint32_t i = 0; i < count; i++) {
-        if (mark_old_mention(router->view_routers, old_count, i, addresses[i]))
+        if (!(taken >> i & 1))
             continue;
-        if (add_router_mention(group, addresses[i]))
-            return 1;
-        changed = true;
+        if (wccp_rtr_view_router *known = find_in_report(router->view_routers, old_count, i, addresses[i])) {
+            known->flags |= MARK;
+        } else if (hold_router(group, addresses[i])) {
+            changed = true;
+        } else {
+            taken &= ~(1u << i);
+            status = 1;
+        }
     }
     for (uint32_t i = 0; i < old_count; i++) {
         if (router->view_routers[i].flags & MARK)
@@ -185,12 +210,13 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
         wccp_remove_router_from_view_list(group, router->view_routers[i].ipa);
         changed = true;
     }
+    router->view_router_count = 0;
     for (uint32_t i = 0; i < count; i++)
-        router->view_routers[i].ipa = addresses[i];
-    router->view_router_count = count;
+        if (taken >> i & 1)
+            router->view_routers[router->view_router_count++].ipa = addresses[i];
     if (changed)
         view_has_changed(group, router, "router");
-    return 0;
+    return status;
 }
 
 // Appliances.
@@ -220,23 +246,23 @@ static int take_reported_weight(wccp_service_group *group, const wccp_rtr_view_a
     return wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_WEIGHT_CHANGE) ? 1 : 0;
 }
 
-static int add_appliance_mention(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
+// Takes a reference on the union's entry of an appliance. False when memory is out.
+static bool hold_appliance(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
     wccp_view_appliance *entry = find_in_union(group->appliance_view, element->ipa);
     if (!entry) {
         entry = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof *entry));
         if (!entry) {
             QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding appliance view failed. out of memory. appliance ipa %s",
                    group->id, addr_text(element->ipa).s);
-            return 1;
+            return false;
         }
         entry->ipa = element->ipa;
         entry->weight = element->weight;
         group->appliance_view_count++;
-        if (wccp_view_list_add_appliance_sorted(group, entry))
-            return 1;
+        (void)wccp_view_list_add_appliance_sorted(group, entry); // refuses only an address that is there
     }
     entry->ref_count++;
-    return 0;
+    return true;
 }
 
 static void router_has_seen_us(wccp_service_group *group, wccp_sending_router *router) {
@@ -255,13 +281,6 @@ static void router_has_lost_us(wccp_service_group *group, wccp_sending_router *r
     wccp_alarm_raise_router_down_alarm(group);
 }
 
-static bool lists(const wccp_rtr_view_appliance *entries, uint32_t count, be32 address) {
-    for (uint32_t i = 0; i < count; i++)
-        if (entries[i].ipa == address)
-            return true;
-    return false;
-}
-
 // The same appliances with the same weights, in the same order: nothing moves but what is assigned to them.
 static bool repeats_last_report(const wccp_sending_router *router, uint32_t count,
                                 const wccp_rtr_view_appliance *decoded) {
@@ -275,9 +294,14 @@ static bool repeats_last_report(const wccp_sending_router *router, uint32_t coun
     return true;
 }
 
-static void copy_report(wccp_sending_router *router, uint32_t count, const wccp_rtr_view_appliance *decoded) {
+// The elements whose bit is set in `taken` become the router's last report.
+static void copy_report(wccp_sending_router *router, uint32_t count, const wccp_rtr_view_appliance *decoded,
+                        uint32_t taken) {
+    router->view_appliance_count = 0;
     for (uint32_t i = 0; i < count; i++) {
-        wccp_rtr_view_appliance *entry = &router->view_appliances[i];
+        if (!(taken >> i & 1))
+            continue;
+        wccp_rtr_view_appliance *entry = &router->view_appliances[router->view_appliance_count++];
         entry->ipa = decoded[i].ipa;
         entry->weight = decoded[i].weight;
         entry->buckets_assigned = decoded[i].buckets_assigned;
@@ -285,24 +309,32 @@ static void copy_report(wccp_sending_router *router, uint32_t count, const wccp_
         if (decoded[i].buckets_assigned != 0)
             memcpy(entry->bucket_bits, decoded[i].bucket_bits, sizeof entry->bucket_bits);
     }
-    router->view_appliance_count = count;
 }
 
-// Moves the union and the connection by what is new in a report, and what is gone. Tells whether anything is.
+// Moves the union and the connection by what is new in a report and what is gone. Gives back which elements
+// were taken, a bit for each, and whether the view has changed.
 static int take_changes(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
-                        const wccp_rtr_view_appliance *decoded, bool *out_changed) {
+                        const wccp_rtr_view_appliance *decoded, uint32_t *out_taken, bool *out_changed) {
     const uint32_t old_count = router->view_appliance_count;
     wccp_rtr_view_appliance *const old = router->view_appliances;
+    int status = 0;
+    *out_taken = first_occurrences(decoded, count);
     clear_marks(old, old_count);
     for (uint32_t i = 0; i < count; i++) {
         const wccp_rtr_view_appliance *element = &decoded[i];
-        if (const wccp_rtr_view_appliance *known = mark_old_mention(old, old_count, i, element->ipa)) {
+        if (!(*out_taken >> i & 1))
+            continue;
+        if (wccp_rtr_view_appliance *known = find_in_report(old, old_count, i, element->ipa)) {
+            known->flags |= MARK;
             if (known->weight != element->weight && take_reported_weight(group, element))
-                return 1;
+                status = 1;
             continue;
         }
-        if (add_appliance_mention(group, element))
-            return 1;
+        if (!hold_appliance(group, element)) {
+            *out_taken &= ~(1u << i);
+            status = 1;
+            continue;
+        }
         *out_changed = true;
         if (element->ipa == group->appliance_ipa)
             router_has_seen_us(group, router);
@@ -312,25 +344,27 @@ static int take_changes(wccp_service_group *group, wccp_sending_router *router, 
             continue;
         wccp_remove_appliance_from_view_list(group, old[i].ipa);
         *out_changed = true;
-        if (old[i].ipa == group->appliance_ipa && !lists(decoded, count, old[i].ipa))
+        if (old[i].ipa == group->appliance_ipa)
             router_has_lost_us(group, router);
     }
-    return 0;
+    return status;
 }
 
 int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                                const wccp_rtr_view_appliance *decoded) {
     if (count > WCCP_MAX_APPLIANCES)
         return 1;
+    uint32_t taken = ~0u;
     bool changed = false;
+    int status = 0;
     if (repeats_last_report(router, count, decoded))
         mark_all(router->view_appliances, count);
-    else if (take_changes(group, router, count, decoded, &changed))
-        return 1;
-    copy_report(router, count, decoded);
+    else
+        status = take_changes(group, router, count, decoded, &taken, &changed);
+    copy_report(router, count, decoded, taken);
     if (changed)
         view_has_changed(group, router, "appliance");
-    return 0;
+    return status;
 }
 
 wccp_rtr_view_appliance *wccp_get_router_appliance_view_element(wccp_sending_router *router, be32 address) {

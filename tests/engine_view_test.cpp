@@ -20,8 +20,8 @@ namespace {
 
 struct ViewTest : testing::Test, all_freed, reported_group {
     ViewTest() : reported_group(false) {}
-    // The union, in list order: routers with their mentions, appliances with weight and mentions; behind it
-    // by how much the change number has risen since the last call.
+    // The union, in list order: routers with their references, appliances with weight and references; then by
+    // how much the change number has risen since the last call.
     std::string views() {
         std::ostringstream text;
         const auto name = [](be32 ipa) { return std::string(addr_text(ipa).s).substr(5); };
@@ -67,17 +67,18 @@ TEST_F(ViewTest, ReportsMoveTheUnion) {
         {A, {}, {{low, 9}, {high, 9}}, "| 1.1/9:1 0.2/9:1 +1"},
         {A, {}, {}, "| +1"},
         {A, {}, {{high, 9}, {low, 9}}, "| 1.1/9:1 0.2/9:1 +1"},
-        // Mentions are counted, and an entry goes with the last.
+        // References are counted, and an entry goes with the last.
         {A, {A, B}, {{US, 100}, {low, 9}}, "0.202:1 0.201:1 | 0.1/100:1 0.2/9:1 +2"},
         {B, {B}, {{low, 9}}, "0.202:2 0.201:1 | 0.1/100:1 0.2/9:2 +2"},
         {A, {A, B}, {{US, 100}}, "0.202:2 0.201:1 | 0.1/100:1 0.2/9:1 +1"},
         {B, {}, {}, "0.202:1 0.201:1 | 0.1/100:1 +2"},
-        // An address that a report names twice keeps union and arrays in step.
-        {A, {A, A}, {{US, 100}, {low, 9}, {US, 50}, {low, 9}}, "0.201:2 | 0.1/100:2 0.2/9:2 +2"},
-        {B, {}, {{low, 9}}, "0.201:2 | 0.1/100:2 0.2/9:3 +1"},
-        {A, {A, A}, {{US, 100}, {low, 9}, {US, 50}, {low, 9}}, "0.201:2 | 0.1/100:2 0.2/9:3 +0"},
-        {A, {A, A}, {{low, 9}, {US, 100}, {low, 9}, {US, 50}}, "0.201:2 | 0.1/100:2 0.2/9:3 +0"},
-        {A, {A}, {{low, 9}, {US, 100}}, "0.201:1 | 0.1/100:1 0.2/9:2 +2"},
+        // Of an address that occurs more than once in a report the first occurrence counts, whether the
+        // address is new or known; the others take no place in the router's arrays.
+        {A, {A, A}, {{US, 100}, {low, 9}, {US, 50}, {low, 9}}, "0.201:1 | 0.1/100:1 0.2/9:1 +2"},
+        {B, {}, {{low, 9}, {low, 9}}, "0.201:1 | 0.1/100:1 0.2/9:2 +1"},
+        {A, {A, A}, {{US, 100}, {low, 9}, {US, 50}, {low, 9}}, "0.201:1 | 0.1/100:1 0.2/9:2 +0"},
+        {A, {A}, {{low, 9}, {US, 100}}, "0.201:1 | 0.1/100:1 0.2/9:2 +0"},
+        {A, {A, A}, {{low, 9}, {low, 9}}, "0.201:1 | 0.2/9:2 +1"},
         {A, {}, {}, "| 0.2/9:1 +2"},
         // A weight follows the last report that differs from its router's own, which is no change of the
         // view.
@@ -92,7 +93,7 @@ TEST_F(ViewTest, ReportsMoveTheUnion) {
         EXPECT_EQ((router(A)->flags & WCCP_RTR_TWO_WAY) != 0,
                   wccp_get_router_appliance_view_element(router(A), US) != nullptr);
     }
-    // An entry that is there already is told and stays behind the head.
+    // An entry that is there already is logged and goes directly after the head.
     auto *again = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof(wccp_view_appliance)));
     again->ipa = US;
     again->weight = 8;
@@ -160,12 +161,17 @@ TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     EXPECT_EQ(group->assign_timer.countdown, 1u);
     EXPECT_EQ(group->pending_acks, 1);
     EXPECT_EQ(router(ROUTER_A)->assign_tx_count, 0u);
-    // With nobody left that all routers report, the update ends there and the router's arrays stay.
+    // With nobody left that all routers report the update fails, but the report is taken to its end: what it
+    // names can go again with the next one.
+    const be32 lowest = to_be32(0x0a000000);
     report(ROUTER_B, {{host(3), 100}});
-    EXPECT_EQ(report(ROUTER_A, {{US, 150}, {host(2), 300}, {host(4), 1}}), 1);
-    EXPECT_EQ(router(ROUTER_A)->view_appliance_count, 2u);
-    EXPECT_EQ(router(ROUTER_A)->view_appliances[0].weight, 100);
+    EXPECT_EQ(report(ROUTER_A, {{lowest, 1}, {US, 150}, {host(4), 1}}), 1);
+    EXPECT_EQ(views(), "| 0.4/1:1 0.1/150:1 0.0/1:1 0.3/100:1 +2");
+    EXPECT_EQ(router(ROUTER_A)->view_appliance_count, 3u);
     EXPECT_EQ(group->assign_timer.active + group->pending_acks, 0);
+    report(ROUTER_A, {{US, 150}, {host(3), 100}});
+    report(ROUTER_B, {{US, 150}, {host(3), 100}});
+    EXPECT_EQ(views(), "| 0.1/150:2 0.3/100:2 +2");
 }
 
 TEST_F(ViewTest, EarlierBucketBitsStayWhereNoneAreAssigned) {
