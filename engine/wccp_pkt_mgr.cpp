@@ -74,29 +74,18 @@ const optional_component optional_components[] = {
     {WCCP_CAPABILITY_INFO, "unloading capability comp.", read_capabilities},
 };
 
-// Also takes what is too short to be a component at all, and refuses it.
-int skip_unknown(wccp_service_group *group, wccp_pkt *pkt, const icu_message *icu) {
-    be16 type = {};
-    const uint32_t left = pkt->length - pkt->offset;
-    memcpy(&type, pkt->cursor, left < sizeof type ? left : sizeof type);
-    QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: ICU component type (%d) not recognized. sender router id %s",
-           group->id, to_host(type), addr_text(icu->router_id).s);
-    if (wccp_pkt_unload_unknown_component(group, pkt))
-        return failed("unloading unknown component", 1);
-    return 0;
-}
-
+// Also refuses what is too short to be a component.
 int read_optional_component(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
-    if (pkt->length - pkt->offset >= sizeof(be16)) {
-        be16 type;
-        memcpy(&type, pkt->cursor, sizeof type);
-        for (const optional_component &row : optional_components)
-            if (row.type == to_host(type)) {
-                const int status = row.read(group, pkt, icu);
-                return status ? failed(row.words, status) : 0;
-            }
+    const uint16_t type = wccp_pkt_next_component_type(pkt);
+    for (const optional_component &row : optional_components) {
+        if (row.type != type)
+            continue;
+        const int status = row.read(group, pkt, icu);
+        return status ? failed(row.words, status) : 0;
     }
-    return skip_unknown(group, pkt, icu);
+    QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: ICU component type (%d) not recognized. sender router id %s",
+           group->id, type, addr_text(icu->router_id).s);
+    return wccp_pkt_unload_unknown_component(group, pkt) ? failed("unloading unknown component", 1) : 0;
 }
 
 // The message as a whole: its components in their order, and no change of the group.

@@ -318,6 +318,7 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
                group->id, shown(declared), shown(smallest - head), addr_text(pkt->ipa).s);
         return 1;
     }
+    *out = {}; // a message may have two maps, and the last one counts
     out->element_count = to_host(map->mask_elements);
     out->masks = look<wccp_wire_mask_element>(pkt, sizeof *map);
     uint64_t size = sizeof *map; // with the component's head
@@ -400,9 +401,14 @@ int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *p
     return 0;
 }
 
+uint16_t wccp_pkt_next_component_type(const wccp_pkt *pkt) {
+    const auto *type = look<be16>(pkt);
+    return type ? to_host(*type) : 0;
+}
+
 int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt) {
     const auto *head = look<wccp_wire_component>(pkt);
-    const int type = head ? to_host(head->type) : 0, length = head ? to_host(head->length) : 0;
+    const int type = wccp_pkt_next_component_type(pkt), length = head ? to_host(head->length) : 0;
     if (head && pass(pkt, sizeof *head + to_host(head->length)) == 0)
         return 0;
     QV_LOG(LC_LOG_ERR,

@@ -20,7 +20,7 @@ struct wccp_rtr_view_info {
     const be32 *routers;
     wccp_view_elements appliances;
 };
-struct wccp_assign_map_info { // zeroed by the caller
+struct wccp_assign_map_info { // all zero when the message has no map
     uint32_t present;
     uint32_t element_count;
     uint32_t value_count; // of the last mask element
@@ -68,6 +68,8 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
 int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *pkt, wccp_command_info *out);
 int wccp_pkt_unload_router_query_component(wccp_service_group *group, wccp_pkt *pkt,
                                            const wccp_wire_router_query **out);
+// The type of the component at the cursor, 0 when it was cut before the end of its type.
+uint16_t wccp_pkt_next_component_type(const wccp_pkt *pkt);
 int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt);
 // Decodes `count` elements, in their order, and sums up what the hash forms assign. `decoded` has room for
 // WCCP_MAX_APPLIANCES entries and is zeroed. Also 1 for a null group, `decoded` or `out_hash`.

@@ -145,6 +145,8 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
          "WCCP: unloading capability comp. failed."},
         {icu(1, no_view, {hex("0063 0001")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
         {icu(1, no_view, {hex("00")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
+        {icu(1, no_view, {hex("0063")}), 0, bad_icu, "component type: 99 length 0 "},
+        {icu(1, no_view, {hex("0063 00")}), 0, bad_icu, "component type: 99 length 0 "},
         {icu(1, no_view, {hex("000e 00")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {icu(1, no_view, {by_hash, odd_command, odd_unknown, odd_unknown}), 0, bad_icu,
          "WCCP GRP 51: ICU bogus packet  (too many optional components)."},
@@ -267,11 +269,14 @@ TEST_F(Messages, AMapFillsTheRoutersView) {
     EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {map({101, 100})})), 0);
     EXPECT_TRUE(bits(0) == 0b10 && bits(1) == 0b01 && made->self_buckets == 1);
 
-    // One without a mask element is refused, once the views have been updated.
+    // One without a mask element is refused, alone or after a full one, once the views have been updated.
     const wire_bytes empty = hex("000e 0024 00000000"), rest = hex("0063 001c").zeros(28);
     EXPECT_EQ(process(icu(1, mask_view(1, {100}), {empty, rest})), 0);
     EXPECT_EQ(group->rx_icu_failures, 1u);
     EXPECT_TRUE(made->view_appliance_count == 1 && made->self_buckets == 1);
+    EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {map({100, 100}), empty, rest})), 0);
+    EXPECT_EQ(group->rx_icu_failures, 2u);
+    EXPECT_TRUE(made->view_appliance_count == 2 && made->self_buckets == 1);
 }
 
 TEST_F(Messages, AMapOfAFullPacketIsTakenWhole) {
