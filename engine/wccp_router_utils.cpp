@@ -4,8 +4,8 @@
 // until the router has been silent for 40 seconds or the group stops. The first router decides the group's
 // forwarding, assignment and return methods for all that follow; they stand until the last router has gone.
 // The records belong to the group's list, and so do the replies to Removal Queries, each a finished message
-// with the number of times that it still has to go out. Their number is bounded: beyond it a query fails as
-// it does when memory is out.
+// with the number of times that it still has to be sent. Their number is bounded for each router; a query
+// beyond it is refused.
 //
 // The engine lock is held throughout: by a receive thread for creation, decision and queries, by the timer
 // thread for the sweep and the replies. Nothing here reads a message or changes a view of its own accord.
@@ -28,9 +28,9 @@
 
 static constexpr uint32_t SILENCE_LIMIT = 40; // seconds without an I-See-You
 static constexpr uint8_t REPLY_TRANSMISSIONS = 3;
-// Each reply holds a whole packet for three seconds, and anybody can send queries: a router that needs more
-// than four answers at a time isn't one.
-static constexpr uint32_t REPLIES_WAITING = 4 * WCCP_MAX_ROUTERS;
+// Of one router. Each reply holds a whole packet for three seconds, and anybody can send queries. With a
+// bound per router, queries in the name of one cannot keep the others from being answered.
+static constexpr uint32_t MAX_REPLIES_WAITING = 8;
 
 static void free_router(wccp_sending_router *router) {
     wccp_free(router);
@@ -248,6 +248,13 @@ int wccp_monitor_sending_routers(wccp_service_group *group) {
 
 // Removal Queries.
 
+static uint32_t replies_waiting(const wccp_service_group *group, be32 router_id) {
+    uint32_t count = 0;
+    for (const wccp_removal_reply *reply = group->removal_replies; reply; reply = reply->next)
+        count += reply->pkt.ipa == router_id;
+    return count;
+}
+
 int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id, be32 receive_id) {
     wccp_sending_router *router = wccp_find_sending_router(group, router_id);
     if (!router) {
@@ -263,9 +270,14 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
         return 0;
     }
     router->receive_id = receive_id;
-    owned<wccp_removal_reply, free_reply> reply;
-    if (group->removal_reply_count < REPLIES_WAITING)
-        reply.pointer = static_cast<wccp_removal_reply *>(wccp_malloc(sizeof(wccp_removal_reply)));
+    if (replies_waiting(group, router_id) >= MAX_REPLIES_WAITING) {
+        QV_LOG(LC_LOG_INFO,
+               "WCCP GRP %d: removal query request. maximum of waiting replies (%d) reached. (router id %s)",
+               group->id, static_cast<int>(MAX_REPLIES_WAITING), addr_text(router_id).s);
+        return 1;
+    }
+    owned<wccp_removal_reply, free_reply> reply(
+        static_cast<wccp_removal_reply *>(wccp_malloc(sizeof(wccp_removal_reply))));
     if (!reply.pointer) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removal query request. cannot allocate pkt to send. (router id %s)",
                group->id, addr_text(router_id).s);
