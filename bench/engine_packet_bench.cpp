@@ -2,18 +2,26 @@
 // and the two messages that this appliance builds, at their largest. Each figure comes with its ratio to a
 // floor that is measured alternately with it: the least that has to be done with the same bytes. The ratio is
 // between the fastest rounds of both, so that a busy machine doesn't show in it.
+//
+// Then the most expensive I-See-You: each of its weights has changed, so that the designated appliance
+// computes its table 32 times, in a group in which nearly a thousand appliances are listed by one router
+// only. Every line below debug level is logged, to a log daemon that reads.
 
 #include <benchmark/benchmark.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <cstring>
 #include <memory>
+#include <thread>
 
 #include "engine/wccp_mgr.h"
 #include "engine/wccp_pkt_load.h"
 #include "engine/wccp_pkt_mgr.h"
+#include "runtime/logging.h"
 #include "runtime/md5.h"
+#include "tests/support/log_daemon.h"
 #include "tests/support/reported_group.h"
 #include "tests/support/wire_bytes.h"
 
@@ -72,9 +80,8 @@ struct full_group {
     reported_appliances appliances;
 };
 
-// The I-See-You of the last router, with the hash buckets of 32 appliances.
-std::vector<uint8_t> steady_icu(const full_group &full) {
-    const bool digested = full.reported.group->security_option == 1;
+// The I-See-You of the last router, with the hash buckets of 32 appliances, 10.0.<third>.1 and so on.
+std::vector<uint8_t> icu(bool digested, uint32_t third, uint32_t weight) {
     wire_bytes security =
         wire_bytes().u16(0).u16(digested ? 20 : 4).u32(digested ? 1 : 0).zeros(digested ? 16 : 0);
     wire_bytes service = wire_bytes().u16(1).u16(24).u8(1).u8(51).zeros(22);
@@ -84,18 +91,24 @@ std::vector<uint8_t> steady_icu(const full_group &full) {
         view.ip(0, 201 + i);
     view.u32(32);
     for (uint32_t i = 0; i < 32; i++)
-        view.ip(0, 1 + i).u32(0).zeros(i).u8(0xff).zeros(31 - i).u16(100).u16(0);
-    wire_bytes capabilities = wire_bytes().u16(8).u16(16).hex("0001000400000002 0003000400000002");
+        view.ip(i == 0 ? 0 : third, 1 + i).u32(0).zeros(i).u8(0xff).zeros(31 - i).u16(weight).u16(0);
+    wire_bytes capabilities =
+        wire_bytes().u16(8).u16(24).hex("0001000400000002 0002000400000001 0003000400000002");
     return wire_message(11, {security, service, identity, view, capabilities});
+}
+
+std::unique_ptr<wccp_pkt> received(const std::vector<uint8_t> &message) {
+    auto pkt = std::make_unique<wccp_pkt>();
+    memcpy(pkt->data, message.data(), message.size());
+    pkt->length = static_cast<uint32_t>(message.size());
+    return pkt;
 }
 
 void i_see_you(benchmark::State &state, bool digested) {
     const full_group full(digested, WCCP_ASSIGN_HASH);
     const wccp_service_group *group = full.reported.group;
-    const std::vector<uint8_t> message = steady_icu(full);
-    const auto pkt = std::make_unique<wccp_pkt>();
-    memcpy(pkt->data, message.data(), message.size());
-    pkt->length = static_cast<uint32_t>(message.size());
+    const std::vector<uint8_t> message = icu(digested, 0, 100);
+    const auto pkt = received(message);
     uint8_t digest[MD5_DIGEST_BYTES];
     wccp_pkt_digest(group, pkt.get(), digest);
     const auto process = [&] {
@@ -156,6 +169,73 @@ void build(benchmark::State &state, int (*builder)(wccp_service_group *, wccp_pk
         state.SkipWithError("the message was not built");
 }
 
+// Takes /dev/log, reads and counts what comes.
+struct reading_log_daemon {
+    explicit reading_log_daemon(int32_t level) {
+        lc_log_init("wccpd", "wccpd", 0, 0x1060000, LC_LOG_INFO, 128, 1);
+        lc_log_set_daemon_log_level(level);
+    }
+    ~reading_log_daemon() {
+        lc_log_set_daemon_log_level(LC_LOG_EMERG);
+        lc_log_close();
+        ended = true;
+        reader.join();
+    }
+    void read() {
+        pollfd watched = {daemon.listener, POLLIN, 0};
+        char line[4096];
+        while (!ended)
+            if (poll(&watched, 1, 10) > 0)
+                while (recv(daemon.listener, line, sizeof line, MSG_DONTWAIT) > 0)
+                    lines++;
+    }
+    log_daemon daemon;
+    std::atomic<bool> ended = false;
+    std::atomic<uint64_t> lines = 0;
+    std::thread reader{[this] { read(); }};
+};
+
+void i_see_you_with_32_changed_weights(benchmark::State &state, int32_t level) {
+    const reported_group reported(true);
+    wccp_service_group *group = reported.group;
+    std::vector<be32> routers;
+    for (uint32_t i = 0; i < 32; i++)
+        routers.push_back(host(201 + i));
+    for (uint32_t i = 0; i < 32; i++) {
+        reported_appliances appliances = {{US, 100}};
+        for (uint32_t k = 1; k < 32; k++)
+            appliances.push_back({host((i + 1) << 8 | (k + 1)), 100});
+        reported.see(routers[i], routers, appliances);
+    }
+    group->assign_method = WCCP_ASSIGN_HASH;
+    const reading_log_daemon log(level);
+    wccp_tick(); // elects
+    std::vector<std::unique_ptr<wccp_pkt>> messages;
+    for (const uint32_t weight : {101, 100})
+        messages.push_back(received(icu(false, 32, weight)));
+    const uint32_t key = group->dsg_key_change;
+    const uint64_t lines = log.lines;
+    std::vector<double> times;
+    for (auto _ : state) {
+        wccp_pkt *pkt = messages[times.size() % 2].get();
+        pkt->offset = 0;
+        pkt->cursor = pkt->data;
+        const auto begin = std::chrono::steady_clock::now();
+        wccp_process_received_packet(pkt);
+        times.push_back(std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count());
+        state.SetIterationTime(times.back());
+    }
+    std::sort(times.begin(), times.end());
+    const auto count = static_cast<double>(times.size());
+    state.counters["bytes"] = messages[0]->length;
+    state.counters["best_ms"] = times.front() * 1e3;
+    state.counters["median_ms"] = times[times.size() / 2] * 1e3;
+    state.counters["lines"] = static_cast<double>(log.lines - lines) / count;
+    if (group->rx_icu_failures || group->appliance_view_count != 993 ||
+        group->dsg_key_change != key + 32 * times.size())
+        state.SkipWithError("the message was not taken as it should be");
+}
+
 } // namespace
 
 static void rounds(benchmark::internal::Benchmark *each) {
@@ -176,5 +256,10 @@ BENCHMARK_CAPTURE(build, redirect_assign_mask_floor_copying, wccp_pkt_build_redi
 BENCHMARK_CAPTURE(build, redirect_assign_mask_md5_floor_md5, wccp_pkt_build_redirect_assign, WCCP_ASSIGN_MASK,
                   true)
     ->Apply(rounds);
+static void messages(benchmark::internal::Benchmark *each) {
+    each->UseManualTime()->Iterations(200)->Unit(benchmark::kMillisecond);
+}
+BENCHMARK_CAPTURE(i_see_you_with_32_changed_weights, notice, LC_LOG_NOTICE)->Apply(messages);
+BENCHMARK_CAPTURE(i_see_you_with_32_changed_weights, info, LC_LOG_INFO)->Apply(messages);
 
 BENCHMARK_MAIN();

@@ -109,11 +109,15 @@ struct wccp_mask_value {
     be32 appliance_ipa;
 };
 
+// Whether all sending routers list an appliance, as the last computation of the table found.
+enum wccp_appliance_listing : uint8_t { WCCP_LISTED_BY_ALL, WCCP_NOT_LISTED_BY_ALL, WCCP_NOT_LISTED_LOGGED };
+
 struct wccp_view_appliance {
     wccp_view_appliance *next, **prev_link;
     be32 ipa;
     uint16_t weight;
     uint16_t ref_count;
+    wccp_appliance_listing listing;
 };
 struct wccp_view_router {
     wccp_view_router *next, **prev_link;
@@ -212,6 +216,8 @@ struct wccp_service_group {
     uint8_t redirecting_routers;
     uint32_t appliance_view_count;
     wccp_view_appliance *appliance_view;
+    uint32_t not_listed_count; // appliances that are WCCP_NOT_LISTED_LOGGED
+    uint32_t not_listed_time;  // when all of them were last logged
     uint32_t sending_router_count;
     wccp_sending_router *sending_routers;
     uint32_t router_view_count;

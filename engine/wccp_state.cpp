@@ -31,6 +31,7 @@
 static constexpr uint32_t ASSIGN_PERIOD = 10;         // seconds
 static constexpr uint32_t ASSIGN_DELAY_ELECTION = 16; // for the routers' views to settle
 static constexpr uint32_t ASSIGN_DELAY_WEIGHT_CHANGE = 1;
+static constexpr uint32_t LEFT_OUT_LOG_PERIOD = 60; // seconds
 
 // The state.
 
@@ -93,6 +94,49 @@ void wccp_clear_redirect_assign_states(wccp_service_group *group) {
     }
 }
 
+// Adds the appliances that all routers list to the assignment. Gives how many are left out, and how many of
+// these have had their line in the log.
+static void collect_eligible_appliances(wccp_service_group *group, uint32_t *out_left_out,
+                                        uint32_t *out_logged) {
+    *out_left_out = *out_logged = 0;
+    for (wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next) {
+        if (wccp_appliance_is_reported_by_all_senders(group, entry->ipa)) {
+            entry->listing = WCCP_LISTED_BY_ALL;
+            wccp_designated_appliance_assignment_add(group, entry);
+            continue;
+        }
+        if (entry->listing == WCCP_LISTED_BY_ALL)
+            entry->listing = WCCP_NOT_LISTED_BY_ALL;
+        ++*out_left_out;
+        *out_logged += entry->listing == WCCP_NOT_LISTED_LOGGED;
+    }
+}
+
+// One I-See-You can bring 32 computations, and a thousand appliances can be left out of each. So an appliance
+// that is left out is logged once. When their set has changed all of it is logged again, but only once a
+// second, and when it has not, then after a minute.
+static void log_appliances_left_out(wccp_service_group *group, uint32_t left_out, uint32_t logged) {
+    const bool changed = logged != left_out || logged != group->not_listed_count;
+    const uint32_t age = wccp_g.seconds - group->not_listed_time;
+    const bool again = age >= LEFT_OUT_LOG_PERIOD || (changed && age != 0);
+    group->not_listed_count = left_out;
+    if (again)
+        group->not_listed_time = wccp_g.seconds;
+    else if (logged == left_out)
+        return;
+    for (wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next) {
+        const bool due =
+            entry->listing == WCCP_NOT_LISTED_BY_ALL || (again && entry->listing == WCCP_NOT_LISTED_LOGGED);
+        if (!due)
+            continue;
+        QV_LOG(LC_LOG_WARNING,
+               "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) is not in all sending "
+               "router views). CHECK configuration.",
+               group->id, addr_text(entry->ipa).s, entry->weight);
+        entry->listing = WCCP_NOT_LISTED_LOGGED;
+    }
+}
+
 int wccp_update_designated_redirect_assignment(wccp_service_group *group, int reason) {
     if (group->designated != 1) {
         QV_LOG(LC_LOG_WARNING,
@@ -102,15 +146,9 @@ int wccp_update_designated_redirect_assignment(wccp_service_group *group, int re
     }
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: redirect assign selection", group->id);
     wccp_designated_appliance_assignment_start(group);
-    for (const wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next) {
-        if (wccp_appliance_is_reported_by_all_senders(group, entry->ipa))
-            wccp_designated_appliance_assignment_add(group, entry);
-        else
-            QV_LOG(LC_LOG_WARNING,
-                   "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) is not in all sending "
-                   "router views). CHECK configuration.",
-                   group->id, addr_text(entry->ipa).s, entry->weight);
-    }
+    uint32_t left_out, logged;
+    collect_eligible_appliances(group, &left_out, &logged);
+    log_appliances_left_out(group, left_out, logged);
     wccp_designated_appliance_assignment_finish(group);
     if (group->dsg_active_count == 0) {
         QV_LOG(LC_LOG_WARNING,

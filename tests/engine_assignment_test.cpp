@@ -120,7 +120,8 @@ struct AssignmentTest : testing::Test {
     void compute(const entries &appliances) {
         wccp_designated_appliance_assignment_start(group.get());
         for (const wccp_dsg_appliance &each : appliances) {
-            const wccp_view_appliance reported = {nullptr, nullptr, each.ipa, each.weight, 1};
+            const wccp_view_appliance reported = {nullptr,     nullptr, each.ipa,
+                                                  each.weight, 1,       WCCP_LISTED_BY_ALL};
             wccp_designated_appliance_assignment_add(group.get(), &reported);
             ASSERT_LE(group->dsg_appliance_count, WCCP_MAX_APPLIANCES);
             ASSERT_EQ(group->bucket_count, 0u); // lies right behind the entries

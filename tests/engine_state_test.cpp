@@ -14,6 +14,7 @@
 #include "engine/wccp_host.h"
 #include "engine/wccp_router_utils.h"
 #include "platform/qvcommon.h"
+#include "runtime/logging.h"
 #include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
@@ -144,6 +145,46 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
     }
     EXPECT_EQ(wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_WEIGHT_CHANGE), 0);
     EXPECT_EQ(group->assign_timer.active, 0);
+}
+
+// Each computation warns of the appliances that not all routers list, but a log can take only so much.
+TEST_F(StateTest, AnApplianceThatIsLeftOutIsLoggedOnce) {
+    log_lines log;
+    lc_log_set_daemon_log_level(LC_LOG_WARNING);
+    const be32 A = ROUTER_A, B = ROUTER_B;
+    const struct {
+        be32 from;
+        reported_appliances appliances;
+        uint32_t seconds; // that pass after the report
+        std::string logged;
+    } steps[] = {
+        {A, {{US, 1}, {host(3), 1}}, 0, ""},
+        {B, {{US, 1}, {host(4), 1}}, 1, "4 3 "}, // elected
+        {A, {{US, 2}, {host(3), 2}}, 0, ""},     // two computations
+        {A, {{US, 3}, {host(3), 3}}, 1, ""},     // and in another second
+        // One with 5, for the first time in this second, and one with 6.
+        {A, {{host(5), 1}, {US, 4}, {host(6), 1}, {host(3), 4}}, 0, "3 5 4 6 "},
+        {B, {{US, 5}, {host(3), 5}, {host(4), 5}}, 0, ""},     // 3 is listed by all from now on
+        {A, {{US, 6}, {host(3), 6}, {host(6), 1}}, 1, "4 6 "}, // 5 is gone, too
+        {B, {{US, 7}, {host(4), 5}}, 1, "3 4 6 "},
+        {A, {{US, 8}, {host(3), 6}, {host(6), 1}}, 59, ""},
+        {A, {{US, 9}, {host(3), 6}, {host(6), 1}}, 1, ""},
+        {A, {{US, 1}, {host(3), 6}, {host(6), 1}}, 1, "3 4 6 "},
+    };
+    for (const auto &step : steps) {
+        see(step.from, {A, B}, step.appliances);
+        for (uint32_t second = 0; second < step.seconds; second++) {
+            router(A)->last_icu_time = router(B)->last_icu_time = wccp_g.seconds;
+            pass_seconds(1);
+        }
+        std::istringstream lines(log.take());
+        std::string logged;
+        for (std::string line; std::getline(lines, line);)
+            if (const size_t at = line.find("NO redirect. appliance (ipa  10.0.0."); at != std::string::npos)
+                logged += line.substr(at + 36, 1) + " ";
+        EXPECT_EQ(logged, step.logged) << "step " << &step - steps;
+    }
+    EXPECT_EQ(group->designated, 1u);
 }
 
 TEST_F(StateTest, ASilentRouterGoesAfter40To44Seconds) {
