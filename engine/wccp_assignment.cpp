@@ -25,6 +25,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_hash_assignment.h"
 #include "engine/wccp_mask_assignment.h"
 #include "engine/wccp_slot_owners.h"
@@ -95,11 +96,12 @@ static void compute_table(wccp_service_group *group) {
     for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
         group->dsg_active_count += entries[i].up == 1;
     if (group->dsg_active_count == 0) {
-        QV_LOG(LC_LOG_ERR,
-               "WCCP GRP %d: DSG event: cannot find any appliances to redirect traffic to. #of apps: %d, "
-               "#of active apps: %d",
-               group->id, static_cast<int>(group->dsg_appliance_count),
-               static_cast<int>(group->dsg_active_count));
+        WCCP_COMPLAIN(
+            LC_LOG_ERR,
+            "WCCP GRP %d: DSG event: cannot find any appliances to redirect traffic to. #of apps: %d, "
+            "#of active apps: %d",
+            group->id, static_cast<int>(group->dsg_appliance_count),
+            static_cast<int>(group->dsg_active_count));
         return;
     }
     group->bucket_count = slots_of_method(group);

@@ -30,6 +30,7 @@
 #include <type_traits>
 
 #include "engine/cthread.h"
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_config.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_link_mgr.h"
@@ -124,6 +125,7 @@ void wccp_tick() {
     if (wccpd_shutdown_in_progress() == 1) // begun while this thread waited
         return;
     wccp_g.seconds++;
+    wccp_report_suppressed_complaints();
     for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
         if (group->admin_state == WCCP_ADMIN_UP)
             wccp_process_timers(group);

@@ -26,6 +26,7 @@
 #include <cstring>
 
 #include "engine/cthread.h"
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_packet_io.h"
 #include "engine/wccp_pkt_mgr.h"
@@ -165,6 +166,7 @@ void *wccp_rx_thread_fn(void *argument) {
         const wccp_engine_lock lock;
         if (wccpd_shutdown_in_progress() == 1)
             continue;
+        const wccp_complaint_scope complaints(interface);
         wccp_process_received_packet(&pkt);
     }
 }

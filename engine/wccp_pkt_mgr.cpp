@@ -20,6 +20,7 @@
 
 #include <cstring>
 
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_packet_io.h"
 #include "engine/wccp_pkt_load.h"
 #include "engine/wccp_pkt_unload.h"
@@ -30,8 +31,9 @@
 
 static constexpr uint32_t OPTIONAL_COMPONENTS = 3; // in one I-See-You
 
+// A step of reading a message failed.
 static int failed(const char *words, int status) {
-    QV_LOG(LC_LOG_ERR, "WCCP: %s failed.", words);
+    WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: %s failed.", words);
     return status;
 }
 
@@ -83,8 +85,8 @@ int read_optional_component(wccp_service_group *group, wccp_pkt *pkt, icu_messag
         const int status = row.read(group, pkt, icu);
         return status ? failed(row.words, status) : 0;
     }
-    QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: ICU component type (%d) not recognized. sender router id %s",
-           group->id, type, addr_text(icu->router_id).s);
+    WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: ICU component type (%d) not recognized. sender router id %s",
+                  group->id, type, addr_text(icu->router_id).s);
     return wccp_pkt_unload_unknown_component(group, pkt) ? failed("unloading unknown component", 1) : 0;
 }
 
@@ -101,11 +103,12 @@ int read_icu(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_i
     const uint32_t flags = to_host(service->flags);
     if (service->priority != group->priority || service->protocol != group->protocol ||
         flags != group->service_flags) {
-        QV_LOG(LC_LOG_WARNING,
-               "WCCP GRP %d: service group config mismatch (router id: %s) .priority: rxed = %u local = %u, "
-               "protocol: rxed = %u local = %u, service flags: rxed = 0x%x local =  0x%x",
-               group->id, addr_text(icu->router_id).s, service->priority, group->priority, service->protocol,
-               group->protocol, flags, group->service_flags);
+        WCCP_COMPLAIN(
+            LC_LOG_WARNING,
+            "WCCP GRP %d: service group config mismatch (router id: %s) .priority: rxed = %u local = %u, "
+            "protocol: rxed = %u local = %u, service flags: rxed = 0x%x local =  0x%x",
+            group->id, addr_text(icu->router_id).s, service->priority, group->priority, service->protocol,
+            group->protocol, flags, group->service_flags);
         group->rx_service_mismatches++;
     }
     if (const int status = wccp_pkt_unload_router_view_component(group, pkt, &icu->view))
@@ -114,7 +117,8 @@ int read_icu(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_i
         if (const int status = read_optional_component(group, pkt, icu))
             return status;
         if (++count > OPTIONAL_COMPONENTS) {
-            QV_LOG(LC_LOG_ERR, "WCCP GRP %d: ICU bogus packet  (too many optional components).", group->id);
+            WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: ICU bogus packet  (too many optional components).",
+                          group->id);
             return 1;
         }
     }
@@ -239,7 +243,7 @@ int wccp_pkt_process_removal_query(wccp_service_group *group, wccp_pkt *pkt) {
 
 static int refuse(const wccp_pkt *pkt) {
     wccp_g.rx_failures++;
-    QV_LOG(LC_LOG_WARNING, "WCCP processing received packet from %s failed", addr_text(pkt->ipa).s);
+    WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP processing received packet from %s failed", addr_text(pkt->ipa).s);
     return 1;
 }
 
@@ -257,14 +261,14 @@ static bool passes_security(wccp_service_group *group, const wccp_pkt *pkt,
                             const wccp_wire_security_info *security, uint8_t *digest) {
     const uint32_t option = to_host(security->option);
     if (option != group->security_option) {
-        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: rxed mismatch security opt: %d configured opt: %d", group->id,
-               static_cast<int>(option), static_cast<int>(group->security_option));
+        WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed mismatch security opt: %d configured opt: %d",
+                      group->id, static_cast<int>(option), static_cast<int>(group->security_option));
         group->rx_auth_mismatches++;
         return false;
     }
     if (option == 1 && !digest_is_right(group, pkt, digest)) {
-        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: rxed authentication failed. Sender's source IP: %s", group->id,
-               addr_text(pkt->ipa).s);
+        WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed authentication failed. Sender's source IP: %s",
+                      group->id, addr_text(pkt->ipa).s);
         group->rx_auth_failures++;
         return false;
     }
@@ -279,14 +283,15 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
     }
     const uint32_t told = to_host(header->length) + static_cast<uint32_t>(sizeof *header);
     if (told != pkt->length) {
-        QV_LOG(LC_LOG_ERR,
-               "WCCP: message header length (%d) and actual packet length (%d) do not match. sender ip: %s",
-               to_host(header->length), static_cast<int>(pkt->length), addr_text(pkt->ipa).s);
+        WCCP_COMPLAIN(
+            LC_LOG_ERR,
+            "WCCP: message header length (%d) and actual packet length (%d) do not match. sender ip: %s",
+            to_host(header->length), static_cast<int>(pkt->length), addr_text(pkt->ipa).s);
         return 0;
     }
     if (to_host(header->version) != WCCP_VERSION) {
-        QV_LOG(LC_LOG_WARNING, "WCCP rxed verion (%d) is not supported. sender ip: %s",
-               to_host(header->version), addr_text(pkt->ipa).s);
+        WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP rxed verion (%d) is not supported. sender ip: %s",
+                      to_host(header->version), addr_text(pkt->ipa).s);
         return 0;
     }
     const uint32_t type = to_host(header->type);
@@ -308,8 +313,8 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
     }
     wccp_service_group *group = wccp_find_group(service->service_id);
     if (!group) {
-        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: rxed service group (%d) is not configured.", service->service_id,
-               service->service_id);
+        WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed service group (%d) is not configured.",
+                      service->service_id, service->service_id);
         return refuse(pkt);
     }
     if (group->admin_state != WCCP_ADMIN_UP) {
@@ -417,8 +422,11 @@ int run_steps(const build_step (&steps)[Count], wccp_service_group *group, wccp_
     for (const build_step &step : steps) {
         if (step.wanted && !step.wanted(group))
             continue;
-        if (const int status = step.load(&build))
-            return failed(step.words, status);
+        const int status = step.load(&build);
+        if (status) {
+            QV_LOG(LC_LOG_ERR, "WCCP: %s failed.", step.words);
+            return status;
+        }
     }
     return 0;
 }

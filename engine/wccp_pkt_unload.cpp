@@ -20,6 +20,7 @@
 #include <climits>
 #include <iterator>
 
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_utils.h"
 
 // The cursor.
@@ -84,7 +85,7 @@ int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_secur
     const bool digested = to_host(info->option) == 1;
     const uint32_t size = digested ? sizeof(wccp_wire_security_md5) : sizeof(wccp_wire_security_info);
     if (to_host(info->head.type) != WCCP_SECURITY_INFO) {
-        QV_LOG(LC_LOG_ERR, "WCCP: expected security componenet. rxed %d", to_host(info->head.type));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: expected security componenet. rxed %d", to_host(info->head.type));
         return 1;
     }
     if (to_host(info->head.length) > size - sizeof info->head)
@@ -103,7 +104,8 @@ int wccp_pkt_unload_service_info_component(wccp_pkt *pkt, const wccp_wire_servic
     if (!info)
         return 1;
     if (to_host(info->head.type) != WCCP_SERVICE_INFO) {
-        QV_LOG(LC_LOG_ERR, "WCCP: expected service info componenet. rxed %d", to_host(info->head.type));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: expected service info componenet. rxed %d",
+                      to_host(info->head.type));
         return 1;
     }
     if (to_host(info->head.length) != sizeof *info - sizeof info->head)
@@ -119,23 +121,23 @@ int wccp_pkt_unload_router_identity_info_component(wccp_service_group *group, wc
     *out = nullptr;
     const auto *identity = look<wccp_wire_router_identity>(pkt);
     if (!identity) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: static length (%d) is longer than remaining pkt len (%d)", group->id,
-               shown(sizeof *identity), shown(remaining(pkt)));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: static length (%d) is longer than remaining pkt len (%d)",
+                      group->id, shown(sizeof *identity), shown(remaining(pkt)));
         return 1;
     }
     if (to_host(identity->head.type) != WCCP_ROUTER_IDENTITY_INFO) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: expecting router id info, rxed %d", group->id,
-               to_host(identity->head.type));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: expecting router id info, rxed %d", group->id,
+                      to_host(identity->head.type));
         return 1;
     }
     const uint64_t size = sizeof *identity + uint64_t{to_host(identity->received_from)} * sizeof(be32);
     if (size > remaining(pkt)) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: full length does not fit in pkt", group->id);
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: full length does not fit in pkt", group->id);
         return 1;
     }
     if (to_host(identity->head.length) != size - sizeof identity->head) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: rxed length (%d) and expected length (%d) mismatch", group->id,
-               to_host(identity->head.length), shown(size - sizeof identity->head));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: rxed length (%d) and expected length (%d) mismatch",
+                      group->id, to_host(identity->head.length), shown(size - sizeof identity->head));
         return 1;
     }
     *out = identity;
@@ -178,22 +180,22 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
     *out = {};
     const auto *view = look<wccp_wire_router_view>(pkt);
     if (!view) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: static component does not fit in pkt", group->id);
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: static component does not fit in pkt", group->id);
         return 1;
     }
     if (to_host(view->head.type) != WCCP_ROUTER_VIEW_INFO) {
-        QV_LOG(LC_LOG_ERR, "WCCP: bad router view type rxed (%d)", to_host(view->head.type));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: bad router view type rxed (%d)", to_host(view->head.type));
         return 1;
     }
     const uint32_t routers = to_host(view->routers);
     if (routers > WCCP_MAX_ROUTERS) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bad number of routers (%d) in ICU pkt. ", group->id,
-               static_cast<int>(routers));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad number of routers (%d) in ICU pkt. ", group->id,
+                      static_cast<int>(routers));
         return 1;
     }
     const auto *addresses = look<be32>(pkt, sizeof *view, routers);
     if (!addresses) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: number of routers does not fit in pkt", group->id);
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: number of routers does not fit in pkt", group->id);
         return 1;
     }
     const uint32_t elements_at = static_cast<uint32_t>(sizeof *view + (routers + 1) * sizeof(be32));
@@ -201,20 +203,22 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
     const auto *count = look<be32>(pkt, elements_at - sizeof(be32));
     const uint32_t appliances = count ? to_host(*count) : 0;
     if (appliances > WCCP_MAX_APPLIANCES) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bad number of appliances (%d) in ICU pkt.", group->id,
-               static_cast<int>(appliances));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad number of appliances (%d) in ICU pkt.", group->id,
+                      static_cast<int>(appliances));
         return 1;
     }
     uint64_t size;
     if (!measure_view(group, pkt, elements_at, appliances, &size)) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: # of appliances (%u x %d bytes) does not fit in pkt length (%u)",
-               group->id, appliances, shown(sizeof(wccp_wire_view_element_hash)), pkt->offset);
+        WCCP_COMPLAIN(LC_LOG_ERR,
+                      "WCCP GRP %d: # of appliances (%u x %d bytes) does not fit in pkt length (%u)",
+                      group->id, appliances, shown(sizeof(wccp_wire_view_element_hash)), pkt->offset);
         return 1;
     }
     if (to_host(view->head.length) != size - sizeof view->head) {
-        QV_LOG(LC_LOG_ERR,
-               "WCCP GRP %d: bad length. rxed length %d pkt length %d (check compatibility mode (IOS/Nexus))",
-               group->id, to_host(view->head.length), shown(size - sizeof view->head));
+        WCCP_COMPLAIN(
+            LC_LOG_ERR,
+            "WCCP GRP %d: bad length. rxed length %d pkt length %d (check compatibility mode (IOS/Nexus))",
+            group->id, to_host(view->head.length), shown(size - sizeof view->head));
         return 1;
     }
     *out = {
@@ -274,7 +278,7 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
             return 1;
         decoded->ipa = head->web_cache_id;
         if (by_hash && to_host(head->hash_revision) != 0) {
-            QV_LOG(LC_LOG_ERR, "WCCP GRP %d: HASH revision is not supported.", group->id);
+            WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: HASH revision is not supported.", group->id);
             return 1;
         }
         decoded->weight = to_host(*weight);
@@ -304,18 +308,19 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
     constexpr uint32_t head = sizeof(wccp_wire_component);
     const auto *map = look<wccp_wire_assignment_map>(pkt);
     if (!map || remaining(pkt) < smallest) {
-        QV_LOG(LC_LOG_ERR,
-               "WCCP GRP %d: minimum assignment map (len = %d) does not fit in the packet. router src ip : "
-               "%s ",
-               group->id, shown(smallest), addr_text(pkt->ipa).s);
+        WCCP_COMPLAIN(
+            LC_LOG_ERR,
+            "WCCP GRP %d: minimum assignment map (len = %d) does not fit in the packet. router src ip : "
+            "%s ",
+            group->id, shown(smallest), addr_text(pkt->ipa).s);
         return 1;
     }
     const uint32_t declared = to_host(map->head.length);
     if (declared < smallest - head) {
-        QV_LOG(LC_LOG_WARNING,
-               "WCCP GRP %d:  assignment map length: %d does not include at least one mask/value set "
-               "(expected minimum len: %d)  router src ip : %s ",
-               group->id, shown(declared), shown(smallest - head), addr_text(pkt->ipa).s);
+        WCCP_COMPLAIN(LC_LOG_WARNING,
+                      "WCCP GRP %d:  assignment map length: %d does not include at least one mask/value set "
+                      "(expected minimum len: %d)  router src ip : %s ",
+                      group->id, shown(declared), shown(smallest - head), addr_text(pkt->ipa).s);
         return 1;
     }
     *out = {}; // a message may have two maps, and the last one counts
@@ -328,10 +333,11 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
         const uint64_t values = element ? to_host(element->values) : 0;
         size = values_at + values * sizeof(wccp_wire_value_element);
         if (!element || size - head > declared || size > remaining(pkt)) {
-            QV_LOG(LC_LOG_ERR,
-                   "WCCP GRP %d: unload assignment map: packet length is BAD or it has bogus values. rxed "
-                   "len: %d current len %d.",
-                   group->id, shown(declared), shown(size - head));
+            WCCP_COMPLAIN(
+                LC_LOG_ERR,
+                "WCCP GRP %d: unload assignment map: packet length is BAD or it has bogus values. rxed "
+                "len: %d current len %d.",
+                group->id, shown(declared), shown(size - head));
             return 1;
         }
         out->value_count = static_cast<uint32_t>(values);
@@ -358,10 +364,11 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
         return 1;
     const uint32_t length = to_host(head->length);
     if (length % element_size != 0) {
-        QV_LOG(LC_LOG_ERR,
-               "WCCP GRP %d: capability component length is not aligned. length %d individual element size "
-               "%d",
-               group->id, shown(length), shown(element_size));
+        WCCP_COMPLAIN(
+            LC_LOG_ERR,
+            "WCCP GRP %d: capability component length is not aligned. length %d individual element size "
+            "%d",
+            group->id, shown(length), shown(element_size));
         return 1;
     }
     if (length >= (std::size(known) + 1) * element_size)
@@ -387,13 +394,13 @@ int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *p
     *out = {};
     const auto *extension = look<wccp_wire_command_ext>(pkt);
     if (!extension) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: no commands in pkt", group->id);
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: no commands in pkt", group->id);
         return 1;
     }
     const uint32_t length = to_host(extension->head.length);
     if (pass(pkt, sizeof extension->head + length)) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bogus component length (%d): does not  fit in the packet.",
-               group->id, shown(length));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bogus component length (%d): does not  fit in the packet.",
+                      group->id, shown(length));
         return 1;
     }
     out->command = to_host(extension->command);
@@ -411,9 +418,9 @@ int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt) 
     const int type = wccp_pkt_next_component_type(pkt), length = head ? to_host(head->length) : 0;
     if (head && pass(pkt, sizeof *head + to_host(head->length)) == 0)
         return 0;
-    QV_LOG(LC_LOG_ERR,
-           "WCCP GRP %d: unkown pkt length does not fit in the packet. component type: %d length %d ",
-           group->id, type, length);
+    WCCP_COMPLAIN(LC_LOG_ERR,
+                  "WCCP GRP %d: unkown pkt length does not fit in the packet. component type: %d length %d ",
+                  group->id, type, length);
     return 1;
 }
 
@@ -425,17 +432,17 @@ int wccp_pkt_unload_router_query_component(wccp_service_group *group, wccp_pkt *
     *out = nullptr;
     const auto *query = look<wccp_wire_router_query>(pkt);
     if (!query) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: router query comp. does not fit in packet.", group->id);
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: router query comp. does not fit in packet.", group->id);
         return 1;
     }
     if (to_host(query->head.type) != WCCP_ROUTER_QUERY_INFO) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bad router query type rxed (%d)", group->id,
-               to_host(query->head.type));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad router query type rxed (%d)", group->id,
+                      to_host(query->head.type));
         return 1;
     }
     if (to_host(query->head.length) != length) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: bad length. rxed length %d pkt length %d", group->id,
-               to_host(query->head.length), shown(length));
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad length. rxed length %d pkt length %d", group->id,
+                      to_host(query->head.length), shown(length));
         return 1;
     }
     *out = query;

@@ -73,6 +73,15 @@ struct wccp_timer {
 };
 enum : uint8_t { WCCP_TIMER_REPEATS = 1, WCCP_TIMER_COUNTS = 2 };
 
+// How many lines the packets of an interface have had logged, see wccp_complaints.h. All zero at first.
+struct wccp_complaint_budget {
+    uint32_t spent;              // lines of the burst that no second has given back yet
+    uint32_t refill_time;        // when `spent` was last brought up to date
+    uint32_t suppressed;         // lines whose number is still to be logged
+    uint32_t suppressed_since;   // when the first of them came
+    uint32_t suppressed_at_tick; // how many there were at the last tick
+};
+
 // An interface that a group names, or the primary one. Never moves, never goes.
 struct wccp_interface {
     char name[WCCP_IF_NAME_BYTES];
@@ -89,6 +98,7 @@ struct wccp_interface {
     uint32_t start_count;
     uint32_t link_down_count;
     uint32_t ipa_change_count;
+    wccp_complaint_budget complaints;
     int32_t device; // the kernel's index of the device that the sockets were opened on, 0 for none
 };
 

@@ -17,6 +17,7 @@
 #include "engine/wccp_router_utils.h"
 
 #include "engine/wccp_alarms.h"
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_state.h"
 #include "engine/wccp_tunnel.h"
@@ -69,7 +70,7 @@ uint32_t offered_code(uint32_t word) {
 const capability_step capability_steps[] = {
     {&capabilities::forwarding, [](const capabilities *) -> uint32_t { return WCCP_METHOD_L2; }, 0,
      [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
-         QV_LOG(
+         WCCP_COMPLAIN(
              LC_LOG_WARNING,
              "WCCP GRP %d: incompatible capabilities (router id %s) : local: (fwd encap: %s ) router sent: "
              "(fwd: %s return: %s)",
@@ -84,19 +85,21 @@ const capability_step capability_steps[] = {
      },
      0,
      [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
-         QV_LOG(LC_LOG_WARNING,
-                "WCCP GRP %d: incompatible capabilities (router id %s) : local assign method: %s  router "
-                "assign method: %s",
-                group, addr_text(router_id).s, wccp_assign_method_name(local->assignment),
-                wccp_assign_method_name(offered_code(offered->assignment)));
+         WCCP_COMPLAIN(
+             LC_LOG_WARNING,
+             "WCCP GRP %d: incompatible capabilities (router id %s) : local assign method: %s  router "
+             "assign method: %s",
+             group, addr_text(router_id).s, wccp_assign_method_name(local->assignment),
+             wccp_assign_method_name(offered_code(offered->assignment)));
      }},
     {&capabilities::ret, [](const capabilities *) -> uint32_t { return WCCP_METHOD_GRE; }, 1,
      [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
-         QV_LOG(LC_LOG_WARNING,
-                "WCCP GRP %d: incompatible capabilities (router id %s) : local return method: %s  router "
-                "return method: %s",
-                group, addr_text(router_id).s, wccp_method_name(local->ret),
-                wccp_method_name(offered_code(offered->ret)));
+         WCCP_COMPLAIN(
+             LC_LOG_WARNING,
+             "WCCP GRP %d: incompatible capabilities (router id %s) : local return method: %s  router "
+             "return method: %s",
+             group, addr_text(router_id).s, wccp_method_name(local->ret),
+             wccp_method_name(offered_code(offered->ret)));
      }},
 };
 
@@ -135,12 +138,12 @@ wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 
                                                 const wccp_rtr_capabilities *offered,
                                                 const wccp_rtr_capabilities *agreed) {
     if (is_zero(router_id)) {
-        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: invalid router id in ICU. 0.0.0.0", group->id);
+        WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: invalid router id in ICU. 0.0.0.0", group->id);
         return nullptr;
     }
     if (group->sending_router_count >= WCCP_MAX_ROUTERS) {
-        QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: Router Maximum (%d) reached", group->id,
-               static_cast<int>(WCCP_MAX_ROUTERS));
+        WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: Router Maximum (%d) reached", group->id,
+                      static_cast<int>(WCCP_MAX_ROUTERS));
         return nullptr;
     }
     owned<wccp_sending_router, free_router> made(

@@ -19,6 +19,7 @@
 
 #include "engine/wccp_alarms.h"
 #include "engine/wccp_assignment.h"
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_router_utils.h"
@@ -151,8 +152,9 @@ int wccp_update_designated_redirect_assignment(wccp_service_group *group, int re
     log_appliances_left_out(group, left_out, logged);
     wccp_designated_appliance_assignment_finish(group);
     if (group->dsg_active_count == 0) {
-        QV_LOG(LC_LOG_WARNING,
-               "WCCP GRP %d: DSG event: NO redirect eligible appliances. CHECK configuration.", group->id);
+        WCCP_COMPLAIN(LC_LOG_WARNING,
+                      "WCCP GRP %d: DSG event: NO redirect eligible appliances. CHECK configuration.",
+                      group->id);
         wccp_designated_appliance_assignment_cleanup(group);
         return 1;
     }

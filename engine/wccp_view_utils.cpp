@@ -24,6 +24,7 @@
 #include <cstring>
 
 #include "engine/wccp_alarms.h"
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_pkt_unload.h"
 #include "engine/wccp_router_utils.h"
 #include "engine/wccp_state.h"
@@ -453,9 +454,9 @@ int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sendin
                                           const wccp_assign_summary *hash, const wccp_assign_summary *mask) {
     const wccp_assign_summary *now = mask->valid == 1 ? mask : hash;
     if (now->valid != 1) {
-        QV_LOG(LC_LOG_WARNING,
-               "WCCP GRP %d: update redirect status: assign. info not found. sender rtr id: %s", group->id,
-               addr_text(router->router_id).s);
+        WCCP_COMPLAIN(LC_LOG_WARNING,
+                      "WCCP GRP %d: update redirect status: assign. info not found. sender rtr id: %s",
+                      group->id, addr_text(router->router_id).s);
         return 1;
     }
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: RX redirect status: rtr id: %s to self: %d/%d buckets (%s)", group->id,

@@ -7,7 +7,9 @@
 
 #include <array>
 #include <cstring>
+#include <sstream>
 
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_router_utils.h"
 #include "tests/support/engine_fixture.h"
 #include "tests/support/log_lines.h"
@@ -188,6 +190,56 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
     group->admin_state = WCCP_ADMIN_UP;
     EXPECT_EQ(process(good), 0);
     EXPECT_NE(router(1), nullptr) << "what was refused above stood for something that passes";
+}
+
+// Two complaints for each bad packet; what is logged of them, tick by tick.
+TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
+    log_lines log;
+    lc_log_set_daemon_log_level(LC_LOG_WARNING);
+    wccp_interface other = {};
+    const auto lines_of = [&log](wccp_interface *interface, int packets, uint32_t seconds) {
+        std::string lines;
+        for (; packets > 0; packets--) {
+            const wccp_complaint_scope complaints(interface);
+            EXPECT_EQ(process(bytes(7, 0)), 1);
+            lines += log.take();
+        }
+        pass_seconds(seconds);
+        lines += log.take();
+        std::istringstream split(lines);
+        std::string line, suppressed;
+        int count = 0;
+        while (std::getline(split, line)) {
+            count += line.find("unloading") != std::string::npos ||
+                     line.find("received packet") != std::string::npos;
+            if (const size_t at = line.find("wan0: "); at != std::string::npos)
+                suppressed = " " + line.substr(at, line.find(" more", at) - at);
+        }
+        return std::to_string(count) + suppressed;
+    };
+    wccp_interface *const wan0 = engine.interface;
+    EXPECT_EQ(lines_of(wan0, 150, 1), "200"); // the burst
+    EXPECT_EQ(lines_of(wan0, 15, 1), "20");   // a second's share
+    EXPECT_EQ(lines_of(&other, 5, 0), "10");
+    EXPECT_EQ(lines_of(wan0, 5, 1), "11 wan0: 110"); // the flood is over
+    EXPECT_EQ(lines_of(wan0, 0, 100), "0");
+    EXPECT_EQ(lines_of(wan0, 101, 0), "200"); // a whole burst again
+    EXPECT_EQ(process(bytes(7, 0)), 1);
+    EXPECT_TRUE(log.say("unloading msg header")) << "outside the interface's scope";
+    lc_log_set_daemon_log_level(LC_LOG_INFO);
+    {
+        const wccp_complaint_scope complaints(wan0);
+        EXPECT_EQ(process(icu(1, view(1, {}))), 0);
+    }
+    EXPECT_TRUE(log.say("created ICU sending router")) << "which is no complaint";
+    lc_log_set_daemon_log_level(LC_LOG_WARNING);
+    // A flood that goes on is reported each minute, and the report has its part in the share.
+    pass_seconds(1);
+    for (int second = 1; second < 59; second++)
+        ASSERT_EQ(lines_of(wan0, 11, 1), "20") << second;
+    EXPECT_EQ(lines_of(wan0, 11, 1), "21 wan0: 120");
+    EXPECT_EQ(lines_of(wan0, 11, 1), "19");
+    EXPECT_EQ(wccp_g.rx_failures, 150u + 15 + 5 + 5 + 101 + 1 + 60 * 11);
 }
 
 TEST_F(Messages, AnISeeYouThatIsCutLeavesTheGroupAsItWas) {

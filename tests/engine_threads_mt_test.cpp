@@ -159,13 +159,16 @@ TEST_F(Threads, BridgeModeWhileReceiversWaitForTheLock) {
     EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0) << "nothing is left to be stopped";
 }
 
-// The waiting itself, again and again: whoever of them gets the lock first, all end.
+// The waiting itself, again and again: whoever of them gets the lock first, all end. And what the receivers
+// complain of counts for their interface.
 TEST_F(Threads, BridgeModeUnderAFlood) {
     std::atomic<bool> over = false;
     std::thread flood([&] {
-        while (!over)
+        while (!over) {
             for (const char *id : {"10.1.0.2", "10.1.0.3", "10.1.0.4"})
                 see_you(first, 61, id, "10.1.0.1", L2);
+            send_datagram(first, "10.1.0.1", 2048, {0});
+        }
     });
     for (int round = 0; round < 30; round++) {
         add_group(61, "wan0");
@@ -179,6 +182,10 @@ TEST_F(Threads, BridgeModeUnderAFlood) {
     }
     over = true;
     flood.join();
+    EXPECT_TRUE(soon([] {
+        const wccp_engine_lock lock;
+        return wccp_if_find_interface("wan0")->complaints.spent != 0;
+    }));
 }
 
 // The whole exit, with the reset of the mailbox and without: the groups wait for the lock, but in bounded

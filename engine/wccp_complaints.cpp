@@ -1,0 +1,52 @@
+#include "engine/wccp_complaints.h"
+
+static constexpr uint32_t BURST = 200;
+static constexpr uint32_t LINES_PER_SECOND = 20;
+static constexpr uint32_t LONGEST_SILENCE = 60; // seconds of a flood without a word of what it suppresses
+
+static wccp_interface *current; // engine lock
+
+wccp_complaint_scope::wccp_complaint_scope(wccp_interface *interface) {
+    current = interface;
+}
+
+wccp_complaint_scope::~wccp_complaint_scope() {
+    current = nullptr;
+}
+
+// One line, if the budget has it.
+static bool spend(wccp_complaint_budget *budget) {
+    const uint64_t refill = uint64_t{LINES_PER_SECOND} * (wccp_g.seconds - budget->refill_time);
+    budget->refill_time = wccp_g.seconds;
+    budget->spent = refill < budget->spent ? budget->spent - static_cast<uint32_t>(refill) : 0;
+    if (budget->spent >= BURST)
+        return false;
+    budget->spent++;
+    return true;
+}
+
+bool wccp_may_complain() {
+    if (!current)
+        return true;
+    wccp_complaint_budget *budget = &current->complaints;
+    if (spend(budget))
+        return true;
+    if (budget->suppressed++ == 0)
+        budget->suppressed_since = wccp_g.seconds;
+    return false;
+}
+
+void wccp_report_suppressed_complaints() {
+    for (uint32_t i = 0; i < wccp_g.if_count; i++) {
+        wccp_complaint_budget *budget = &wccp_g.interfaces[i].complaints;
+        const bool goes_on = budget->suppressed != budget->suppressed_at_tick;
+        budget->suppressed_at_tick = budget->suppressed;
+        if (budget->suppressed == 0 ||
+            (goes_on && wccp_g.seconds - budget->suppressed_since < LONGEST_SILENCE))
+            continue;
+        (void)spend(budget); // a tick refills it
+        QV_LOG(LC_LOG_ERR, "WCCP: %s: %u more lines about received packets were suppressed.",
+               wccp_g.interfaces[i].name, budget->suppressed);
+        budget->suppressed = budget->suppressed_at_tick = 0;
+    }
+}
