@@ -11,8 +11,9 @@
 // command. It is sent under the lock while addresses, sockets and methods are still those that the routers
 // know. A group in INIT has nothing to withdraw and sends none, which makes a stop safe to repeat.
 //
-// A multicast group on an interface without an address cannot join, and is reported as a failure although it
-// stays in the tables: the first address opens the sockets, joins, and starts it.
+// A multicast group that cannot join, on an interface without an address above all, is reported as a failure
+// although it stays in the tables. The first address opens the sockets, joins, and starts it; after another
+// failure, the first retry of the set-up that succeeds does.
 
 #include "engine/wccp_config.h"
 
@@ -39,6 +40,7 @@ namespace {
 
 constexpr uint32_t HERE_I_AM_SECONDS = 10;
 constexpr uint32_t MONITOR_SECONDS = 5;
+constexpr uint32_t NETWORK_RETRY_SECONDS = 30;
 constexpr uint8_t MCAST_TTL_FOR_ZERO = 33;
 
 // Which update sets which bit of service_flags.
@@ -129,12 +131,29 @@ void free_group(wccp_service_group *group) {
     wccp_free(group);
 }
 
+// For configuration, which may add hundreds of groups in one second: one attempt is enough then.
+void recover_for_configuration(wccp_interface *interface) {
+    if (interface->network_tried != wccp_g.seconds)
+        wccp_recover_interface(interface);
+}
+
+bool is_needed(const wccp_interface *interface) {
+    if (!wccp_if_is_ready(interface))
+        return false;
+    for (const wccp_service_group *group = interface->groups; group; group = group->if_next)
+        if (group->admin_state == WCCP_ADMIN_UP)
+            return true;
+    return false;
+}
+
 wccp_interface *find_or_add_interface(const wccp_grp_config *config) {
     char name[WCCP_IF_NAME_BYTES];
     snprintf(name, sizeof name, "%.*s", static_cast<int>(sizeof name - 1), config->interface);
     const wccp_engine_lock lock;
     wccp_interface *interface = wccp_if_find_interface(name);
-    if (!interface)
+    if (interface)
+        recover_for_configuration(interface);
+    else
         interface = wccp_if_add_interface(name);
     if (!interface)
         QV_LOG(LC_LOG_ERR, "WCCP:wccp_add_group: interface %s add failed.", name);
@@ -307,6 +326,8 @@ namespace {
 int wccp_enable_group(wccp_service_group *group, const wccp_grp_config *) {
     if (group->admin_state == WCCP_ADMIN_UP)
         return 0;
+    if (group->interfaces[0])
+        recover_for_configuration(group->interfaces[0]);
     group->admin_state = WCCP_ADMIN_UP;
     wccp_start_service_group(group);
     return 0;
@@ -449,6 +470,28 @@ void wccp_start_service_groups_by_interface(wccp_interface *interface) {
     for (wccp_service_group *group = interface->groups; group; group = group->if_next)
         if (group->admin_state == WCCP_ADMIN_UP)
             wccp_start_service_group(group);
+}
+
+void wccp_start_waiting_groups(wccp_interface *interface) {
+    if (!wccp_if_is_ready(interface))
+        return;
+    for (wccp_service_group *group = interface->groups; group; group = group->if_next)
+        if (group->admin_state == WCCP_ADMIN_UP && !wccp_group_is_running(group))
+            wccp_start_service_group(group);
+}
+
+void wccp_recover_interface(wccp_interface *interface) {
+    if (wccp_retry_network(interface))
+        wccp_start_waiting_groups(interface);
+}
+
+void wccp_recover_interfaces_due() {
+    for (uint32_t i = 0; i < wccp_g.if_count; i++) {
+        wccp_interface *interface = &wccp_g.interfaces[i];
+        if (interface->network_flaws != 0 &&
+            wccp_g.seconds - interface->network_tried >= NETWORK_RETRY_SECONDS && is_needed(interface))
+            wccp_recover_interface(interface);
+    }
 }
 
 void wccp_stop_service_groups_by_interface(wccp_interface *interface) {

@@ -36,5 +36,11 @@ void wccp_stop_service_group(wccp_service_group *group);
 int wccp_stop_all_service_groups();
 void wccp_start_service_groups_by_interface(wccp_interface *interface);
 void wccp_stop_service_groups_by_interface(wccp_interface *interface);
+// Starts the enabled groups of a ready interface that are not running.
+void wccp_start_waiting_groups(wccp_interface *interface);
+// Retries what the socket set-up of the interface could not do. If that succeeds, starts those groups.
+void wccp_recover_interface(wccp_interface *interface);
+// Does so for each interface that lacks something an enabled group needs, every 30 seconds.
+void wccp_recover_interfaces_due();
 int wccp_notify_service_group_shutdown(wccp_service_group *group);
 int wccp_flush_group_lists(wccp_service_group *group);

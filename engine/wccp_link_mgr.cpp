@@ -88,12 +88,15 @@ void wccp_process_if_state_change(const void *argument) {
         return;
     }
     const uint32_t up = info->admin_up && info->link_up ? 1 : 0;
-    if (interface->link_up == up)
+    if (interface->link_up == up) {
+        wccp_recover_interface(interface);
         return;
+    }
     interface->link_up = up;
     QV_LOG(LC_LOG_NOTICE, up ? "WCCP: Interface %s is UP" : "WCCP: Interface %s is DOWN", interface->name);
     if (up) {
         interface->ready_flags |= WCCP_LINK_READY;
+        wccp_retry_network(interface);
         wccp_start_service_groups_by_interface(interface);
     } else {
         interface->link_down_count++;
@@ -125,11 +128,17 @@ void address_replaced(wccp_interface *interface) {
     wccp_start_service_groups_by_interface(interface);
 }
 
-void open_on_another_device(wccp_interface *interface) {
-    if (is_zero(interface->ipa) || interface->device == wccp_get_device(interface->name))
+// The address is as it was; the device under it, or what the sockets lack, may not be.
+void address_confirmed(wccp_interface *interface) {
+    if (is_zero(interface->ipa))
         return;
+    if (interface->device == wccp_get_device(interface->name)) {
+        wccp_recover_interface(interface);
+        return;
+    }
     QV_LOG(LC_LOG_INFO, "WCCP: Interface %s was created again; opening its sockets again", interface->name);
-    wccp_init_network_by_interface(interface);
+    if (wccp_init_network_by_interface(interface) == 0)
+        wccp_start_waiting_groups(interface);
 }
 
 } // namespace
@@ -148,7 +157,7 @@ void wccp_process_if_ipa_update(const void *argument) {
     }
     const be32 old_ipa = interface->ipa, new_ipa = wccp_get_address(interface->name);
     if (old_ipa == new_ipa) {
-        open_on_another_device(interface);
+        address_confirmed(interface);
         return;
     }
     interface->ipa_change_count++;

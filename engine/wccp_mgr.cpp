@@ -129,6 +129,7 @@ void wccp_tick() {
     for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
         if (group->admin_state == WCCP_ADMIN_UP)
             wccp_process_timers(group);
+    wccp_recover_interfaces_due();
 }
 
 void *wccp_timer_thread_fn(void *) {

@@ -2,7 +2,12 @@
 //
 // Each interface owns a unicast socket, bound to its address, and a multicast socket, bound to the first
 // group address that is joined on it. They are opened and closed with the engine lock held, by the main
-// thread and the notifier, neither of which is ever cancelled.
+// thread and the notifier, neither of which is ever cancelled, and by the timer thread with cancellation off.
+//
+// A step can fail for want of descriptors, or because another process has the port. The interface then stays
+// as far as the set-up got, and remembers that something is missing. That is tried again at the next
+// notification for the interface, when configuration adds or enables a group on it, and every 30 seconds
+// while an enabled group needs it.
 //
 // All groups of an interface send Here-I-Am in one tick, with the engine lock held, and their routers answer
 // at once: with 256 groups of 32 routers, some 8000 datagrams wait for the end of that tick. The kernel's
@@ -32,6 +37,7 @@
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_utils.h"
 #include "platform/qvcommon.h"
+#include "runtime/guards.h"
 #include "runtime/logging.h"
 
 namespace {
@@ -173,35 +179,68 @@ void *wccp_rx_thread_fn(void *argument) {
 
 int wccp_init_network_by_interface(wccp_interface *interface) {
     wccp_close_sockets(interface);
+    interface->network_flaws = 0;
+    interface->network_tried = wccp_g.seconds;
     if (is_zero(interface->ipa)) {
         QV_LOG(LC_LOG_INFO, "WCCP: net init %s not bound (no IP address)", interface->name);
         return 0;
     }
     interface->device = wccp_get_device(interface->name);
-    if (open_unicast(interface) || open_multicast(interface))
+    if (open_unicast(interface) || open_multicast(interface)) {
+        interface->network_flaws |= WCCP_FLAW_SOCKETS;
         return 1;
+    }
     wccp_config_mcast(interface);
     QV_LOG(LC_LOG_INFO, "WCCP: net init %s: sockets of %s are open", interface->name,
            addr_text(interface->ipa).s);
-    return start_rx_thread(interface);
+    if (start_rx_thread(interface) == 0)
+        return 0;
+    interface->network_flaws |= WCCP_FLAW_SOCKETS;
+    return 1;
+}
+
+bool wccp_retry_network(wccp_interface *interface) {
+    if (interface->network_flaws == 0 || is_zero(interface->ipa))
+        return false;
+    const cancel_off_guard whole; // the timer thread may be cancelled, and a descriptor would be lost
+    if (interface->network_flaws & WCCP_FLAW_SOCKETS) {
+        wccp_init_network_by_interface(interface);
+    } else { // sockets that work stay open
+        interface->network_flaws = 0;
+        interface->network_tried = wccp_g.seconds;
+        wccp_config_mcast(interface);
+    }
+    if (interface->network_flaws != 0)
+        return false;
+    QV_LOG(LC_LOG_NOTICE, "WCCP: net init %s: socket set-up of %s succeeded after an earlier failure",
+           interface->name, addr_text(interface->ipa).s);
+    return true;
 }
 
 int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
-    if (interface->mcast_fd == -1)
+    if (interface->mcast_fd == -1 || is_zero(interface->ipa))
         return 1;
     if (!interface->mcast_bound) {
         if (bind_to(interface->mcast_fd, address) != 0) {
             QV_LOG(LC_LOG_ERR, "WCCP: Interface %s: Cannot bind mcast UDP socket to %s:%d. %m",
                    interface->name, addr_text(address).s, WCCP_PORT);
+            // Sending gives the unbound socket another port: a retry needs a new one.
+            interface->network_flaws |= WCCP_FLAW_SOCKETS;
             return 1;
         }
         interface->mcast_bound = 1;
+        interface->mcast_bound_ipa = address;
     }
     ip_mreq membership = {};
     membership.imr_multiaddr.s_addr = raw_word(address);
     membership.imr_interface.s_addr = raw_word(interface->ipa);
-    if (setsockopt(interface->mcast_fd, IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof membership) == 0)
+    if (setsockopt(interface->mcast_fd, IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof membership) == 0) {
+        if (address != interface->mcast_bound_ipa)
+            QV_LOG(LC_LOG_NOTICE,
+                   "WCCP: Interface %s: the multicast socket is bound to %s: what is sent to %s is not heard",
+                   interface->name, addr_text(interface->mcast_bound_ipa).s, addr_text(address).s);
         return 0;
+    }
     if (errno == EADDRINUSE) {
         QV_LOG(LC_LOG_INFO, "WCCP: Interface %s: We've already subscribed to mcast group: %s",
                interface->name, addr_text(address).s);
@@ -209,6 +248,7 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
     }
     QV_LOG(LC_LOG_ERR, "WCCP: Interface %s: Failed to join multicast group: %s, errno: %m", interface->name,
            addr_text(address).s);
+    interface->network_flaws |= WCCP_FLAW_JOIN;
     return 1;
 }
 

@@ -8,7 +8,10 @@
 // thread unless there is one. Engine lock held, or at start; 0, or 1 when a step failed. 0 without an
 // address.
 int wccp_init_network_by_interface(wccp_interface *interface);
-// Engine lock held; 0 or 1.
+// Does again what the last set-up of the interface could not do. True when there was such a thing and now
+// nothing is missing. Engine lock held.
+bool wccp_retry_network(wccp_interface *interface);
+// Engine lock held; 0, or 1 when the interface has no socket or address, or the kernel refuses.
 int wccp_join_mc_grp(wccp_interface *interface, be32 address);
 // Joins the multicast addresses of all groups of the interface. Engine lock held, or at start; always 0.
 int wccp_config_mcast(wccp_interface *interface);

@@ -99,8 +99,12 @@ struct wccp_interface {
     uint32_t link_down_count;
     uint32_t ipa_change_count;
     wccp_complaint_budget complaints;
-    int32_t device; // the kernel's index of the device that the sockets were opened on, 0 for none
+    int32_t device;         // the kernel's index of the device that the sockets were opened on, 0 for none
+    be32 mcast_bound_ipa;   // what mcast_fd is bound to
+    uint32_t network_flaws; // what the last socket set-up could not do
+    uint32_t network_tried; // wccp_g.seconds of the last attempt
 };
+enum : uint32_t { WCCP_FLAW_SOCKETS = 1, WCCP_FLAW_JOIN = 2 }; // network_flaws
 
 struct wccp_dsg_appliance {
     be32 ipa;

@@ -17,6 +17,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstring>
+#include <functional>
 #include <utility>
 
 #include "engine/cthread.h"
@@ -25,9 +26,11 @@
 #include "engine/wccp_interface.h"
 #include "engine/wccp_link_mgr.h"
 #include "engine/wccp_mgr.h"
+#include "engine/wccp_utils.h"
 #include "platform/limits.h"
 #include "runtime/common.h"
 #include "tests/support/engine_fixture.h"
+#include "tests/support/log_lines.h"
 
 namespace {
 
@@ -149,10 +152,150 @@ TEST_F(Network, AFailedBindLeavesTheSocketOpenAndStopsAllSending) {
     EXPECT_EQ(open_descriptors(), descriptors);
 }
 
+size_t count_of(const std::string &text, const std::string &in) {
+    size_t count = 0;
+    for (size_t at = 0; (at = in.find(text, at)) != std::string::npos; at++)
+        count++;
+    return count;
+}
+
+// Whatever keeps a set-up from succeeding, it is tried again at each of these occasions, and at no other.
+TEST_F(Network, AFailedSetUpIsTriedAgain) {
+    const int port_owner = socket(AF_INET, SOCK_DGRAM, 0);
+    sockaddr_in port = {};
+    port.sin_family = AF_INET;
+    port.sin_port = htons(2048);
+    port.sin_addr.s_addr = address_word("10.0.0.100");
+    const auto own_port = [&](bool on) {
+        port.sin_port = on ? htons(2048) : 0;
+        const int fd = socket(AF_INET, SOCK_DGRAM, 0);
+        // A receive thread in its wait keeps a closed socket for up to a second: shared with that one only.
+        for (const int shared : {1, 0}) {
+            ASSERT_EQ(setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &shared, sizeof shared), 0);
+            if (shared) {
+                ASSERT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&port), sizeof port), 0);
+            }
+        }
+        dup2(fd, port_owner);
+        close(fd);
+    };
+    rlimit limit = {};
+    getrlimit(RLIMIT_NOFILE, &limit);
+    const auto take_descriptors = [&limit](bool on) {
+        const rlimit none = {on ? 3 : limit.rlim_cur, limit.rlim_max};
+        setrlimit(RLIMIT_NOFILE, &none);
+    };
+    const std::function<void(bool)> causes[] = {own_port, take_descriptors};
+
+    log_lines log;
+    wccp_service_group *known = live_group();
+    const wccp_grp_config unicast = engine_fixture::group_config(61, {"10.0.0.2"}),
+                          multicast = engine_fixture::group_config(62, {"224.0.1.62"});
+    wccp_grp_config admin = {};
+    admin.group_id = 61;
+    admin.config_flags = WCCP_CFG_ADMIN;
+    const auto set_admin = [&admin](uint32_t state) {
+        admin.admin = state;
+        EXPECT_EQ(wccp_modify_grp(&admin), 0);
+    };
+    const auto tick = [](int seconds) {
+        while (seconds-- > 0)
+            wccp_tick();
+    };
+    const struct {
+        const char *name;
+        std::function<void()> happens;
+    } occasions[] = {
+        {"thirty seconds", [&] { tick(30); }},
+        {"a link notification", [] { tell_link("wan0", 1, 1); }},
+        {"the link comes",
+         [] {
+             tell_link("wan0", 1, 0);
+             tell_link("wan0", 1, 1);
+         }},
+        {"an address notification", [] { wccp_process_if_ipa_update("wan0"); }},
+        {"a group is created again",
+         [&] {
+             tick(1);
+             EXPECT_EQ(wccp_del_group(61), 0);
+             EXPECT_EQ(wccp_add_group(&unicast), 0);
+         }},
+        {"a group is enabled",
+         [&] {
+             tick(1);
+             set_admin(WCCP_ADMIN_DOWN);
+             set_admin(WCCP_ADMIN_UP);
+         }},
+    };
+    for (const auto &cause : causes)
+        for (const auto &occasion : occasions) {
+            SCOPED_TRACE(occasion.name);
+            wccp_close_sockets(wan);
+            cause(true);
+            EXPECT_EQ(wccp_init_network_by_interface(wan), 1);
+            log.take();
+            EXPECT_EQ(wccp_add_group(&multicast), 1);
+            EXPECT_EQ(count_of("WCCP: net init", log.take()), 0u) << "not twice in one second";
+            occasion.happens();
+            EXPECT_EQ(wan->ucast_bound, 0u);
+            cause(false);
+            tick(&occasion == occasions ? 29 : 5);
+            EXPECT_EQ(wan->ucast_bound, 0u);
+            log.take();
+            occasion.happens();
+            EXPECT_TRUE(wan->ucast_bound == 1 && wan->mcast_fd >= 0);
+            tick(31);
+            EXPECT_EQ(count_of("socket set-up of 10.0.0.100 succeeded after an earlier failure", log.take()),
+                      1u);
+            // A group that could not join is started, and somebody receives.
+            EXPECT_EQ(wccp_find_group(62)->hia_timer.active, 1);
+            EXPECT_EQ(wan->mcast_bound_ipa, ipa("224.0.1.62"));
+            EXPECT_EQ(threads_named("WCCP_RX_wan0"), 1);
+            EXPECT_EQ(wccp_del_group(62), 0);
+        }
+    close(port_owner);
+
+    // Nobody needs it.
+    known = wccp_find_group(61);
+    wan->network_flaws = WCCP_FLAW_SOCKETS;
+    struct stat before = {}, after = {};
+    fstat(wan->ucast_fd, &before);
+    for (const uint32_t state : {0u, WCCP_ADMIN_DOWN + 0u}) {
+        known->admin_state = state;
+        tick(31);
+    }
+    known->admin_state = WCCP_ADMIN_UP;
+    wan->ready_flags = WCCP_IPA_READY;
+    tick(31);
+    EXPECT_EQ(wan->network_flaws, WCCP_FLAW_SOCKETS + 0u);
+
+    // For a join alone no socket is opened again.
+    wan->ready_flags = WCCP_ALL_READY;
+    wan->network_flaws = 0;
+    EXPECT_EQ(wccp_add_group(&multicast), 0);
+    run_command("echo 1 >/proc/sys/net/ipv4/igmp_max_memberships");
+    wccp_grp_config other = engine_fixture::group_config(63, {"224.0.1.63"});
+    EXPECT_EQ(wccp_add_group(&other), 1);
+    run_command("echo 20 >/proc/sys/net/ipv4/igmp_max_memberships");
+    tick(30);
+    EXPECT_EQ(wccp_find_group(63)->hia_timer.active, 1);
+    fstat(wan->ucast_fd, &after);
+    EXPECT_EQ(after.st_ino, before.st_ino);
+}
+
 TEST_F(Network, JoiningBindsOnceAndRepeatsWithoutHarm) {
     EXPECT_EQ(wccp_join_mc_grp(bare("closed0"), ipa("224.0.1.5")), 1);
-    for (const char *address : {"224.0.1.5", "224.0.1.5", "224.0.1.6"})
+    // The sockets outlive the address, but nothing is joined by whatever other interface the kernel finds.
+    wan->ipa = {};
+    EXPECT_EQ(wccp_join_mc_grp(wan, ipa("224.0.1.5")), 1);
+    EXPECT_EQ(wan->mcast_bound, 0u);
+    wan->ipa = ipa("10.0.0.100");
+    log_lines log;
+    for (const char *address : {"224.0.1.5", "224.0.1.5", "224.0.1.6", "224.0.1.6"})
         EXPECT_EQ(wccp_join_mc_grp(wan, ipa(address)), 0);
+    const std::string lines = log.take();
+    EXPECT_EQ(count_of("is not heard", lines), 1u) << lines;
+    EXPECT_EQ(count_of("is bound to 224.0.1.5: what is sent to 224.0.1.6 is not heard", lines), 1u) << lines;
     EXPECT_EQ(wan->mcast_bound, 1u);
     EXPECT_EQ(bound_to(wan->mcast_fd).sin_addr.s_addr, address_word("224.0.1.5"));
     EXPECT_EQ(bound_to(wan->mcast_fd).sin_port, htons(2048));
