@@ -1,23 +1,24 @@
 // Link and address notifications from rtnetlink.
 //
 // One thread, started by the first qv_start_netlink_monitor and there until the process is gone, owns
-// everything below but the callbacks, the set of started kinds and the set of kinds that want a look: the
-// table of interfaces by index and the socket that hears the kernel's notifications. It blocks every signal,
-// and sleeps until the kernel says something.
+// everything below but the callbacks, the set of started kinds and the wish for a look: the table of
+// interfaces by index and the socket that hears the kernel's notifications. It blocks every signal, and
+// sleeps until the kernel says something.
 //
 // What a program is told. A link state event is a change of an interface's name, administrative state or
 // operational state (IFF_UP, IFF_RUNNING); a notification that changes none of these is no event. An address
 // event is any notification about an IPv4 address of the interface. A name that goes (deleted, renamed, moved
 // to another namespace) is told as down, with an address event behind it, before a name that comes is told,
-// unless another interface has it by then. When a kind starts, every interface is told once, so that a change
+// unless another interface has it by then. When a kind starts, every interface is told, so that a change
 // between the caller's own look and the start isn't lost.
 //
-// Loss. When the kernel's queue has overrun (a storm, or a callback that took long) or a notification names
-// an interface that we don't know, nothing that is queued can be trusted: what is older than the loss would
-// undo what a look has found. So the queue is emptied first, and then every interface is asked for, told as
-// changed or not; what vanished is told as down, and a name that now belongs to another interface is told as
-// down and again as it is. Notifications that come during the look are read after it, and end in the latest
-// state. A look that fails is tried again a little later.
+// Looks. When a kind starts, when the kernel's queue has overrun (a storm, or a callback that took long), or
+// when a notification names an interface that is not known, nothing that is queued can be trusted: what is
+// older than the look would undo what the look has found. The queue is therefore emptied first. That drops
+// notifications of every kind, so then every interface is asked for, and each started kind is told of each of
+// them, changed or not. What vanished is told as down, and a name that now belongs to another interface is
+// told as down and again as it is. Notifications that come during the look are read after it, and end in the
+// latest state. A look that fails is tried again a little later.
 //
 // The process may be in exit() while this thread runs. Hence no object here has a destructor, and of libnl
 // only the core is used, whose code has none either; libnl-route's objects hang from tables that its
@@ -67,9 +68,9 @@ struct interface_table {
 };
 
 std::atomic<qv_netlink_callback> callbacks[QV_NOTIFY_KINDS];
-std::atomic<uint32_t> started;     // bit by kind
-std::atomic<uint32_t> look_wanted; // bit by kind
-int wake_fd = -1;                  // an eventfd: look_wanted has changed
+std::atomic<uint32_t> started; // bit by kind
+std::atomic<bool> look_wanted;
+int wake_fd = -1; // an eventfd: look_wanted has changed
 pthread_mutex_t start_mutex = PTHREAD_MUTEX_INITIALIZER;
 bool running; // start_mutex
 
@@ -146,7 +147,7 @@ bool read_link(nlmsghdr *header, interface *out) {
 }
 
 void want_look() {
-    look_wanted.fetch_or((1u << QV_NOTIFY_KINDS) - 1, std::memory_order_acq_rel);
+    look_wanted.store(true, std::memory_order_release);
 }
 
 void link_is(const interface *now) {
@@ -255,7 +256,7 @@ bool ask_for_all(interface_table *out) {
     return result >= 0;
 }
 
-bool look_at_all(uint32_t kinds) {
+bool look_at_all() {
     empty_queue();
     interface_table fresh = {};
     if (!ask_for_all(&fresh)) {
@@ -272,10 +273,8 @@ bool look_at_all(uint32_t kinds) {
     free(old.entries);
     for (uint32_t i = 0; i < known.count; i++) {
         const interface entry = known.entries[i];
-        if (kinds & (1u << QV_NOTIFY_LINK_STATE))
-            tell_link(entry.name, entry.admin_up, entry.link_up);
-        if (kinds & (1u << QV_NOTIFY_IPA_CHANGE))
-            tell_address(entry.name);
+        tell_link(entry.name, entry.admin_up, entry.link_up);
+        tell_address(entry.name);
     }
     return true;
 }
@@ -283,11 +282,9 @@ bool look_at_all(uint32_t kinds) {
 void *monitor(void *) {
     for (;;) {
         int wait = -1;
-        if (const uint32_t kinds = look_wanted.exchange(0, std::memory_order_acq_rel)) {
-            if (!look_at_all(kinds)) {
-                look_wanted.fetch_or(kinds, std::memory_order_acq_rel);
-                wait = LOOK_AGAIN_MS;
-            }
+        if (look_wanted.exchange(false, std::memory_order_acq_rel) && !look_at_all()) {
+            want_look();
+            wait = LOOK_AGAIN_MS;
         }
         pollfd fds[2] = {{nl_socket_get_fd(monitor_socket), POLLIN, 0}, {wake_fd, POLLIN, 0}};
         if (poll(fds, 2, wait) < 0)
@@ -366,7 +363,7 @@ int qv_netlink_start(uint32_t kind) {
     }
     if (error == 0) {
         started.fetch_or(1u << kind, std::memory_order_acq_rel);
-        look_wanted.fetch_or(1u << kind, std::memory_order_acq_rel);
+        want_look();
         const uint64_t one = 1;
         if (write(wake_fd, &one, sizeof one) < 0)
             error = EIO;

@@ -89,7 +89,17 @@ void on_address(const void *argument) {
     seen->take(static_cast<const char *>(argument), true, "");
 }
 
-void start() {
+void hold(bool on) {
+    std::unique_lock lock(seen->mutex);
+    seen->held = on;
+    seen->changed.notify_all();
+}
+
+void shell(const std::string &command) {
+    ASSERT_EQ(system(command.c_str()), 0) << command;
+}
+
+void start(void (*between_the_kinds)() = [] {}) {
     if (seen)
         return;
     seen = new picture;
@@ -99,12 +109,23 @@ void start() {
     EXPECT_NE(qv_register_netlink_notifier(0, nullptr), 0);
     ASSERT_EQ(qv_register_netlink_notifier(QV_NOTIFY_LINK_STATE, on_link), 0);
     ASSERT_EQ(qv_start_netlink_monitor(QV_NOTIFY_LINK_STATE), 0);
+    between_the_kinds();
     ASSERT_EQ(qv_register_netlink_notifier(QV_NOTIFY_IPA_CHANGE, on_address), 0);
     ASSERT_EQ(qv_start_netlink_monitor(QV_NOTIFY_IPA_CHANGE), 0);
 }
 
-void shell(const std::string &command) {
-    ASSERT_EQ(system(command.c_str()), 0) << command;
+// Leaves a change of a link in the queue that the start of the other kind empties: a callback waits
+// meanwhile.
+void change_early() {
+    shell("ip link add early type veth peer name other && ip link set other up && ip link set early up");
+    std::unique_lock lock(seen->mutex);
+    ASSERT_TRUE(seen->changed.wait_for(lock, 10s, [] { return seen->links["early"] == "1/1"; }));
+    seen->held = true;
+    lock.unlock();
+    shell("ip link set lo down && ip link set lo up");
+    lock.lock();
+    ASSERT_TRUE(seen->changed.wait_for(lock, 10s, [] { return seen->waiting; }));
+    shell("ip link set early down");
 }
 
 int flip(const char *name, bool up) {
@@ -155,11 +176,6 @@ testing::AssertionResult picture_is_the_kernels() {
                               : testing::AssertionFailure() << "wrong:" << difference;
 }
 
-void hold(bool on) {
-    std::unique_lock lock(seen->mutex);
-    seen->held = on;
-    seen->changed.notify_all();
-}
 void forget_told() {
     std::unique_lock lock(seen->mutex);
     seen->told.clear();
@@ -171,7 +187,8 @@ bool was_told(const char *text) {
 
 struct Netlink : testing::Test {
     void SetUp() override {
-        start();
+        start(change_early);
+        hold(false);
         shell("ip link add va type veth peer name vb && ip link set vb up && ip link set va up && "
               "ip addr add 10.9.0.1/24 dev va");
         ASSERT_TRUE(picture_is_the_kernels());
