@@ -416,14 +416,15 @@ lab_state() { # NODE [GROUP]
 }
 
 # What would be left behind in an appliance: processes, shared memory and semaphores, sockets, interfaces, files. The
-# registry of shared memory and the tunnel mailbox stay by design, with nobody attached, and so does the pid file.
+# registry of shared memory with its semaphore and the tunnel mailbox stay by design, with nobody attached, and so does
+# the pid file.
 lab_remains() { # NODE
     lab_in "$1" bash -c '
         for own in /proc/[0-9]*; do
             [ "${own#/proc/}" = 1 ] || [ "${own#/proc/}" = $$ ] || tr "\0" " " <$own/cmdline 2>/dev/null | sed "s/^/process /;s/\$/\n/"
         done
         awk "FNR > 1 && ! (\$7 == 0 && (\$1 == -1091567891 || \$1 == 1464025933)) { print \"segment\", \$1, \"attached\", \$7 }" /proc/sysvipc/shm
-        tail -n +2 -q /proc/sysvipc/sem /proc/sysvipc/msg | sed "s/^/semaphore or queue /"
+        tail -n +2 -q /proc/sysvipc/sem /proc/sysvipc/msg | grep -v "^-1091567891 " | sed "s/^/semaphore or queue /"
         grep -hE "^ *[0-9]+: [0-9A-F]+:0800" /proc/net/udp /proc/net/raw | sed "s/^/socket /"
         sed 1d /proc/net/unix | grep -o "/.*" | grep -v "^/dev/log\$" | sed "s/^/socket /"
         sed "1,2d;s/:.*//;s/^ */interface /" /proc/net/dev

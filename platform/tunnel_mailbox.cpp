@@ -29,9 +29,9 @@ bool wccp_attach_mailbox() {
     if (!block)
         return false;
     if (length < sizeof(wccp_tunnel_mailbox)) {
-        static std::atomic<bool> told; // once: this is tried again and again
-        if (!told.exchange(true))
-            QV_LOG(LC_LOG_ERR, "Block %s has %lu bytes in place of %lu and is not used", WCCP_MAILBOX_NAME,
+        static std::atomic<bool> logged; // once: this is tried again and again
+        if (!logged.exchange(true))
+            QV_LOG(LC_LOG_ERR, "Block %s has %lu bytes instead of %lu and is not used", WCCP_MAILBOX_NAME,
                    static_cast<unsigned long>(length),
                    static_cast<unsigned long>(sizeof(wccp_tunnel_mailbox)));
         shmdt(block);

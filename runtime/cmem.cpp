@@ -2,12 +2,16 @@
 // segment.
 //
 // The registry is a format: 2000 block records, 400 entries of "mem.conf" and a state word, which the first
-// process swaps from empty to loading and sets to ready. A free record is claimed by compare-and-swap, since
-// several processes may create at once. Only a registry that cannot be attached stops the process.
+// process swaps from empty to loading and sets to ready, or back to empty when it could not read the file.
+// Only a registry that cannot be attached stops the process.
 //
-// A key may belong to a segment that someone else has made, of another size: its size is looked at before a
+// Which process creates a block is decided under a semaphore that has the registry's key. It is 0 while
+// nobody holds it, and the kernel takes back what a holder that dies has added. A free record is claimed by
+// compare-and-swap all the same: the format has programs that know no semaphore.
+//
+// A key may belong to a segment that someone else has created, of another size: its size is checked before a
 // byte of it is used. A block that is too short is refused like one that cannot be attached; a registry that
-// is too short counts as one that cannot be attached.
+// is too short, or whose state word has no meaning, counts as one that cannot be attached.
 #include "runtime/cmem.h"
 
 #include <atomic>
@@ -21,6 +25,7 @@
 #include <fcntl.h>
 #include <numa.h>
 #include <signal.h>
+#include <sys/sem.h>
 #include <sys/shm.h>
 #include <unistd.h>
 
@@ -35,6 +40,7 @@ constexpr size_t CONF_LINE_BYTES = 256;
 constexpr uint64_t NORMAL_PAGE = 4096;
 constexpr uint64_t HUGE_PAGE_BYTES = 0x200000;
 constexpr int SHARED_MODE = 0777;
+constexpr unsigned WAIT_SECONDS = 5; // for another process that loads the registry or creates a block
 enum : int32_t { NODE_LOCAL = -2, NODE_INTERLEAVED = -1 };
 enum : uint32_t { REGISTRY_EMPTY = 0, REGISTRY_LOADING = 0xFFFFFFFF, REGISTRY_READY = 1 };
 
@@ -85,7 +91,12 @@ static_assert(offsetof(cmem_registry, conf) == 336000 && offsetof(cmem_registry,
 static_assert(sizeof(cmem_registry) == 361608);
 
 static cmem_registry *registry;
+static bool created_here[MAX_BLOCKS]; // by this process or the one that it was forked from
 static pthread_mutex_t registry_lock = PTHREAD_MUTEX_INITIALIZER;
+
+static uint64_t round_up(uint64_t length, uint64_t page) {
+    return length > UINT64_MAX - page ? UINT64_MAX / page * page : (length + page - 1) / page * page;
+}
 
 // --- mem.conf
 
@@ -156,15 +167,14 @@ static bool parse_conf_line(char *line, cmem_conf *out) {
     return true;
 }
 
-// Fills at most all entries of a registry that this process is loading.
-static void load_conf(cmem_registry *fresh) {
+// Fills the entries of a registry that this process is loading. False, with a line, when the file cannot be
+// read; the entries are then empty.
+static bool load_conf(cmem_registry *fresh) {
     FILE *file = fopen(CMEM_CONF_PATH, "re");
-    if (!file)
-        return;
     char line[CONF_LINE_BYTES];
     cmem_conf entry;
     bool inside = false; // of a line longer than the buffer: the rest of it is passed over
-    for (uint32_t count = 0; count < MAX_CONF && fgets(line, sizeof line, file);) {
+    for (uint32_t count = 0; file && count < MAX_CONF && fgets(line, sizeof line, file);) {
         const bool rest = inside;
         char *end = strpbrk(line, "\r\n");
         inside = !end && strlen(line) == sizeof line - 1;
@@ -173,15 +183,54 @@ static void load_conf(cmem_registry *fresh) {
         if (!rest && parse_conf_line(line, &entry))
             fresh->conf[count++] = entry;
     }
-    fclose(file);
+    const bool failed = !file || ferror(file);
+    if (failed) {
+        QV_LOG(LC_LOG_ERR, "%s: cannot read %s, err=%s\n", "cmem_load_conf", CMEM_CONF_PATH, strerror(errno));
+        memset(static_cast<void *>(fresh->conf), 0, sizeof fresh->conf);
+    }
+    if (file)
+        fclose(file);
+    return !failed;
 }
 
 // --- The registry
 
-// Bytes behind a segment, 0 when it cannot be told.
+// Bytes that can be used behind a segment: its last page is there as a whole. 0 when it cannot be told.
 static uint64_t segment_bytes(int id) {
     shmid_ds status = {};
-    return shmctl(id, IPC_STAT, &status) == 0 ? status.shm_segsz : 0;
+    return shmctl(id, IPC_STAT, &status) == 0 ? round_up(status.shm_segsz, NORMAL_PAGE) : 0;
+}
+
+[[noreturn]] static void attach_failed() {
+    QV_LOG(LC_LOG_ERR, "%s: Cannot attach to shmem, err=%s\n", "cmem_attach_registry", strerror(errno));
+    abort();
+}
+
+// Sees to it that the configuration is in the registry: loads it, or waits for the process that does. False,
+// with a line, when that process does not finish. A file that cannot be read is left to the next process.
+static bool fill_registry(cmem_registry *fresh) {
+    for (unsigned waited = 0;; waited++) {
+        uint32_t state = REGISTRY_EMPTY;
+        if (fresh->state.compare_exchange_strong(state, REGISTRY_LOADING)) {
+            fresh->state = load_conf(fresh) ? REGISTRY_READY : REGISTRY_EMPTY;
+            return true;
+        }
+        if (state == REGISTRY_READY)
+            return true;
+        if (state != REGISTRY_LOADING) {
+            errno = EINVAL;
+            attach_failed();
+        }
+        if (waited == WAIT_SECONDS)
+            break;
+        sleep(1);
+    }
+    const auto key = static_cast<uint32_t>(CMEM_REGISTRY_KEY);
+    QV_LOG(LC_LOG_ERR,
+           "%s: the block registry has been loading for %u seconds; the process that loads it hangs or has "
+           "died. Remove it with \"ipcrm -M 0x%x\" when no program uses it\n",
+           "cmem_attach_registry", WAIT_SECONDS, key);
+    return false;
 }
 
 static cmem_registry *attach_registry() {
@@ -191,20 +240,19 @@ static cmem_registry *attach_registry() {
     // Another's segment that is shorter gives EINVAL here.
     const int id = shmget(CMEM_REGISTRY_KEY, sizeof(cmem_registry), IPC_CREAT | SHARED_MODE);
     void *memory = id >= 0 ? shmat(id, nullptr, 0) : reinterpret_cast<void *>(-1);
-    if (memory == reinterpret_cast<void *>(-1)) {
-        QV_LOG(LC_LOG_ERR, "%s: Cannot attach to shmem, err=%s\n", "cmem_attach_registry", strerror(errno));
-        abort();
-    }
+    if (memory == reinterpret_cast<void *>(-1))
+        attach_failed();
     cmem_registry *attached = static_cast<cmem_registry *>(memory);
-    uint32_t expected = REGISTRY_EMPTY;
-    if (attached->state.compare_exchange_strong(expected, REGISTRY_LOADING)) {
-        load_conf(attached);
-        attached->state = REGISTRY_READY;
-    }
-    while (attached->state != REGISTRY_READY)
-        sleep(1);
-    registry = attached;
+    if (fill_registry(attached))
+        registry = attached;
+    else
+        shmdt(memory);
     return registry;
+}
+
+bool cmem_attach_registry() {
+    const cancel_off_guard uncancelled;
+    return attach_registry() != nullptr;
 }
 
 static cmem_block *find_block(cmem_registry *known, const char *name) {
@@ -228,18 +276,33 @@ static void free_block(cmem_block *block) {
     block->in_use = 0;
 }
 
-// By the creator's numa_maps; where the kernel has none at all, by its process id.
-static bool creator_lives(int32_t pid) {
+// A process that has ended and was not waited for yet. It still has its files in /proc.
+static bool is_zombie(int32_t pid) {
+    char path[64], text[256] = {};
+    snprintf(path, sizeof path, "/proc/%d/stat", pid);
+    const int fd = open(path, O_RDONLY | O_CLOEXEC);
+    if (fd < 0)
+        return false;
+    const ssize_t length = read(fd, text, sizeof text - 1);
+    close(fd);
+    const char *name_end = length > 0 ? strrchr(text, ')') : nullptr;
+    return name_end && (strncmp(name_end, ") Z", 3) == 0 || strncmp(name_end, ") X", 3) == 0);
+}
+
+// By the creator's numa_maps; where the kernel has none at all, by its process id. A record with our own id
+// that we did not create is of an earlier process that had the same one.
+static bool creator_lives(const cmem_registry *known, const cmem_block *block) {
+    const int32_t pid = block->pid;
+    if (pid == getpid())
+        return created_here[block - known->blocks];
     char path[64];
     snprintf(path, sizeof path, "/proc/%d/numa_maps", pid);
     const int fd = open(path, O_RDONLY | O_CLOEXEC);
     if (fd >= 0)
         close(fd);
-    return fd >= 0 || (access("/proc/self/numa_maps", F_OK) != 0 && pid > 0 && kill(pid, 0) == 0);
-}
-
-static uint64_t round_up(uint64_t length, uint64_t page) {
-    return length > UINT64_MAX - page ? UINT64_MAX / page * page : (length + page - 1) / page * page;
+    const bool exists =
+        fd >= 0 || (access("/proc/self/numa_maps", F_OK) != 0 && pid > 0 && kill(pid, 0) == 0);
+    return exists && !is_zombie(pid);
 }
 
 static const cmem_conf *find_conf(const cmem_registry *known, const char *name) {
@@ -271,11 +334,6 @@ static void reset_block(cmem_block *block, const cmem_registry *known, const cha
     __atomic_store_n(&block->name[0], name[0], __ATOMIC_RELEASE);
 }
 
-static void log_double_create(const char *name, int32_t old_pid, int32_t new_pid) {
-    QV_LOG(LC_LOG_ERR, "%s: double create attempt for memory block %s, old pid=%d, new pid=%d\n",
-           "cmem_create_block", name, old_pid, new_pid);
-}
-
 // The record to use for a name: a new one, or the one of a creator that has gone.
 static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t length) {
     cmem_block *block = find_block(known, name);
@@ -285,10 +343,9 @@ static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t l
             QV_LOG(LC_LOG_ERR, "%s: out of memory tracking blocks\n", "cmem_create_block");
         return block;
     }
-    const int32_t old_pid = block->pid;
-    const int32_t new_pid = getpid();
-    if (creator_lives(old_pid)) {
-        log_double_create(name, old_pid, new_pid);
+    if (creator_lives(known, block)) {
+        QV_LOG(LC_LOG_ERR, "%s: double create attempt for memory block %s, old pid=%d, new pid=%d\n",
+               "cmem_create_block", name, block->pid.load(), getpid());
         return nullptr;
     }
     const uint64_t rounded = round_up(length, block->page_size ? block->page_size : NORMAL_PAGE);
@@ -298,11 +355,49 @@ static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t l
                static_cast<unsigned long>(rounded));
         return nullptr;
     }
-    int32_t expected = old_pid;
-    if (!block->pid.compare_exchange_strong(expected, new_pid)) {
-        log_double_create(name, expected, new_pid); // another process has just taken it over
+    return block;
+}
+
+namespace {
+
+// Held by the one process that looks for a name and takes its record.
+struct creation_lock {
+    creation_lock() : id(semget(CMEM_REGISTRY_KEY, 1, IPC_CREAT | SHARED_MODE)) {
+        sembuf take[] = {{.sem_num = 0, .sem_op = 0, .sem_flg = 0},
+                         {.sem_num = 0, .sem_op = 1, .sem_flg = SEM_UNDO}};
+        const timespec limit = {WAIT_SECONDS, 0};
+        int result;
+        do
+            result = semtimedop(id, take, 2, &limit);
+        while (result != 0 && errno == EINTR);
+        held = result == 0;
+    }
+    ~creation_lock() {
+        sembuf release = {.sem_num = 0, .sem_op = -1, .sem_flg = SEM_UNDO | IPC_NOWAIT};
+        if (held)
+            semop(id, &release, 1);
+    }
+    creation_lock(const creation_lock &) = delete;
+    creation_lock &operator=(const creation_lock &) = delete;
+    int id;
+    bool held;
+};
+
+} // namespace
+
+// The filled record of a block that this process may create; null, with a line, when it may not.
+static cmem_block *claim_name(cmem_registry *known, const char *name, uint64_t length) {
+    const creation_lock lock;
+    if (!lock.held) {
+        QV_LOG(LC_LOG_ERR, "%s: cannot lock the registry for memory block %s, err=%s\n", "cmem_create_block",
+               name, strerror(errno));
         return nullptr;
     }
+    cmem_block *block = take_block(known, name, length);
+    if (!block)
+        return nullptr;
+    reset_block(block, known, name, length);
+    created_here[block - known->blocks] = true;
     return block;
 }
 
@@ -324,10 +419,9 @@ void *cmem_create_block(uint64_t length, const char *name) {
         return nullptr;
     const cancel_off_guard uncancelled;
     cmem_registry *known = attach_registry();
-    cmem_block *block = take_block(known, name, length);
+    cmem_block *block = known ? claim_name(known, name, length) : nullptr;
     if (!block)
         return nullptr;
-    reset_block(block, known, name, length);
     if (block->key == 0) {
         QV_LOG(LC_LOG_ERR, "%s: attempt to create shared block %s conflicts with conf file\n", __func__,
                name);
@@ -340,7 +434,7 @@ void *cmem_create_block(uint64_t length, const char *name) {
     if (fresh)
         id = shmget(key, block->length,
                     IPC_CREAT | SHARED_MODE | (block->page_size > NORMAL_PAGE ? SHM_HUGETLB : 0));
-    else if (segment_bytes(id) < length) {
+    else if (segment_bytes(id) < block->length) {
         errno = EINVAL;
         id = -1;
     }
@@ -364,8 +458,7 @@ void *cmem_create_block(uint64_t length, const char *name) {
     block->creator_address = reinterpret_cast<uint64_t>(memory);
     if (fresh)
         place_on_node(memory, block);
-    const uint64_t held = segment_bytes(id);
-    memset(memory, 0, held < block->length ? held : block->length);
+    memset(memory, 0, block->length);
     return memory;
 }
 
@@ -393,6 +486,8 @@ void *cmem_attach_block(const char *name, uint64_t *out_length) {
     if (out_length)
         *out_length = 0;
     cmem_registry *known = attach_registry();
+    if (!known)
+        return nullptr;
     const cmem_block *block = name && *name ? find_block(known, name) : nullptr;
     if (!block) {
         QV_LOG(LC_LOG_WARNING, "%s: memory block %s not found\n", __func__, name ? name : "");
@@ -404,7 +499,7 @@ void *cmem_attach_block(const char *name, uint64_t *out_length) {
     }
     int id = shmget(static_cast<int>(block->key), 0, 0);
     const uint64_t held = id >= 0 ? segment_bytes(id) : 0;
-    if (id >= 0 && (held == 0 || round_up(held, NORMAL_PAGE) < block->length)) {
+    if (id >= 0 && (held == 0 || held < block->length)) {
         errno = EINVAL;
         id = -1;
     }

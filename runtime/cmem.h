@@ -9,13 +9,17 @@
 constexpr int32_t CMEM_REGISTRY_KEY = static_cast<int32_t>(0xBEEFFEED);
 constexpr const char *CMEM_CONF_PATH = "/etc/opt/rvl/mem.conf";
 
-// 1 when the block stands in the registry as this process sees it and its key exists, else 0.
+// Attaches the registry, and loads "mem.conf" into it when no other process has. The other operations do this
+// when they need it. False, with an error line, when another process has been loading for 5 seconds; a
+// registry that cannot be attached ends the process.
+bool cmem_attach_registry();
+// 1 when the block is in the registry that this process has attached and its key exists, else 0.
 int cmem_exists_block(const char *name);
-// A new zeroed block of at least `length` bytes, or the zeroed block of a creator that has gone; null on
-// failure.
+// A new zeroed block of at least `length` bytes, or the zeroed block of a creator that has gone; null, with a
+// line, on failure. Of several processes that create one block, exactly one gets it.
 void *cmem_create_block(uint64_t length, const char *name);
-// The block that another process has made, read and write; null on failure. `out_length`, when given, gets
-// the size of the segment behind it.
+// The block that another process has created, read and write; null, with a line, on failure. `out_length`,
+// when given, gets the bytes that can be used: the segment in whole pages.
 void *cmem_attach_block(const char *name, uint64_t *out_length = nullptr);
 
 // A named mutex with default attributes.

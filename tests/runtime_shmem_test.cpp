@@ -5,14 +5,18 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <atomic>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <memory>
 
 #include <csignal>
 #include <sched.h>
+#include <sys/mman.h>
 #include <sys/shm.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include "runtime/csys.h"
 #include "runtime/logging.h"
@@ -21,6 +25,16 @@
 constexpr uint64_t BLOCK_BYTES = 10000; // 12288 in pages
 constexpr key_t BLOCK_KEY = 0x12345;
 constexpr size_t REGISTRY_BYTES = 361608;
+
+// The C library's, in its place: nothing waits here, and another process may do something meanwhile.
+static unsigned slept;
+static std::function<void()> while_asleep;
+extern "C" unsigned sleep(unsigned seconds) {
+    slept += seconds;
+    if (while_asleep)
+        while_asleep();
+    return 0;
+}
 
 static void write_conf(const std::string &text) {
     std::ofstream(CMEM_CONF_PATH) << text;
@@ -43,6 +57,14 @@ static int in_process(bool own_keys, const std::function<void()> &body) {
 }
 #define IN_CHILD(...) ASSERT_EQ(in_process(true, [&]() __VA_ARGS__), 0)
 
+// The bytes of the registry, which is created empty when there is none.
+static uint8_t *registry_bytes() {
+    return static_cast<uint8_t *>(
+        shmat(shmget(CMEM_REGISTRY_KEY, REGISTRY_BYTES, IPC_CREAT | 0777), nullptr, 0));
+}
+static std::atomic<uint32_t> &registry_state() {
+    return *reinterpret_cast<std::atomic<uint32_t> *>(registry_bytes() + 361600);
+}
 static shmid_ds segment_of(key_t key) {
     shmid_ds status = {};
     EXPECT_EQ(shmctl(shmget(key, 0, 0), IPC_STAT, &status), 0);
@@ -88,8 +110,7 @@ TEST_F(Blocks, ANewBlockIsFoundByOthersAndInTheRegistry) {
         EXPECT_TRUE(told("cmem_attach_block: memory block nobody not found\n"));
 
         EXPECT_EQ(segment_of(CMEM_REGISTRY_KEY).shm_segsz, REGISTRY_BYTES);
-        const auto *bytes =
-            static_cast<const uint8_t *>(shmat(shmget(CMEM_REGISTRY_KEY, 0, 0), nullptr, SHM_RDONLY));
+        const uint8_t *bytes = registry_bytes();
         EXPECT_STREQ(reinterpret_cast<const char *>(bytes), "block");
         EXPECT_STREQ(reinterpret_cast<const char *>(bytes + 336064), "other");
         const std::pair<size_t, uint32_t> words[] = {{64, 12288},
@@ -118,6 +139,89 @@ TEST_F(Blocks, TheNextProcessTakesOverWhatIsLeft) {
         EXPECT_EQ(shmget(BLOCK_KEY, 0, 0), id);
         EXPECT_EQ(std::count(block, block + 12288, 0), 12288);
     });
+    IN_CHILD({ // from one that nobody has waited for, and from an earlier one with our process id
+        const pid_t gone = fork();
+        if (gone == 0)
+            _exit(create(BLOCK_BYTES, "block") && create(1, "other") ? 0 : 1);
+        siginfo_t info;
+        ASSERT_EQ(waitid(P_PID, static_cast<id_t>(gone), &info, WEXITED | WNOWAIT), 0);
+        EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
+        const int32_t pid = getpid();
+        memcpy(registry_bytes() + 168 + 112, &pid, sizeof pid);
+        EXPECT_NE(create(1, "other"), nullptr);
+        EXPECT_EQ(create(1, "other"), nullptr); // now it is ours
+        (void)waitpid(gone, nullptr, 0);
+    });
+}
+
+// Two processes create one block at the same moment, in turn a new one and one whose creator has gone.
+TEST_F(Blocks, OfTwoProcessesExactlyOneCreatesABlock) {
+    constexpr int ROUNDS = 300;
+    IN_CHILD({
+        ASSERT_TRUE(cmem_attach_registry());
+        (void)lc_log_set_daemon_log_level(0); // the refused one complains each time
+        struct meeting {
+            std::atomic<int> ready, done, created;
+        };
+        auto *both = static_cast<meeting *>(
+            mmap(nullptr, sizeof(meeting), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
+        const auto meet = [](std::atomic<int> *count) {
+            for (++*count; *count < 2;)
+                sched_yield();
+        };
+        int wrong = 0;
+        for (int round = 0; round < ROUNDS; round++) {
+            both->ready = both->done = both->created = 0;
+            pid_t processes[2];
+            for (pid_t &process : processes)
+                if ((process = fork()) == 0) {
+                    meet(&both->ready);
+                    both->created += create(BLOCK_BYTES, "block") != nullptr;
+                    meet(&both->done);
+                    _exit(0);
+                }
+            for (const pid_t process : processes)
+                (void)waitpid(process, nullptr, 0);
+            wrong += both->created != 1;
+            if (round % 2 == 0)
+                memset(registry_bytes(), 0, 336000);
+        }
+        EXPECT_EQ(wrong, 0);
+    });
+}
+
+TEST_F(Blocks, ARegistryThatIsNotReady) {
+    constexpr uint32_t EMPTY = 0, LOADING = 0xFFFFFFFF, READY = 1;
+    IN_CHILD({ // the process that loads it has died
+        registry_state() = LOADING;
+        EXPECT_EQ(create(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_EQ(slept, 5u);
+        EXPECT_TRUE(told("cmem_attach_registry: the block registry has been loading for 5 seconds"));
+        EXPECT_EQ(segment_of(CMEM_REGISTRY_KEY).shm_nattch, 1u); // this test's
+        // It gets there in time, or gives up.
+        registry_state() = LOADING;
+        while_asleep = [] { registry_state() = EMPTY; };
+        EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_EQ(registry_state(), READY);
+    });
+    const int status = in_process(true, [&] {
+        registry_state() = 7;
+        (void)cmem_attach_registry();
+    });
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
+    EXPECT_TRUE(told("cmem_attach_registry: Cannot attach to shmem, err=Invalid argument\n"));
+    IN_CHILD({ // a file that cannot be read now can be for the next process
+        std::filesystem::remove(CMEM_CONF_PATH);
+        EXPECT_EQ(in_process(false, [] { EXPECT_TRUE(cmem_attach_registry()); }), 0);
+        EXPECT_TRUE(
+            told("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=No such file or directory\n"));
+        std::filesystem::create_directory(CMEM_CONF_PATH);
+        EXPECT_EQ(in_process(false, [] { EXPECT_TRUE(cmem_attach_registry()); }), 0);
+        EXPECT_TRUE(told("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=Is a directory\n"));
+        std::filesystem::remove(CMEM_CONF_PATH);
+        write_conf("block local normal 12345\n");
+        EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
+    });
 }
 
 TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
@@ -139,10 +243,13 @@ TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
         EXPECT_EQ(cmem_attach_block("other"), nullptr);
         EXPECT_TRUE(told("cannot shmget shared block other, key=74566, err=Invalid argument\n"));
     });
-    IN_CHILD({ // exactly as long as needed, but no whole pages
-        ASSERT_GE(shmget(BLOCK_KEY, BLOCK_BYTES, IPC_CREAT | 0777), 0);
-        EXPECT_TRUE(create(BLOCK_BYTES, "block") && cmem_attach_block("block"));
-    });
+    for (const size_t bytes : {size_t{8193}, size_t{BLOCK_BYTES}}) // enough in whole pages
+        IN_CHILD({
+            ASSERT_GE(shmget(BLOCK_KEY, bytes, IPC_CREAT | 0777), 0);
+            uint64_t length = 0;
+            EXPECT_TRUE(create(BLOCK_BYTES, "block") && cmem_attach_block("block", &length));
+            EXPECT_EQ(length, 12288u);
+        });
     for (const size_t bytes : {size_t{1}, REGISTRY_BYTES - 1}) { // a registry that is too short
         const int status = in_process(true, [&] {
             ASSERT_GE(shmget(CMEM_REGISTRY_KEY, bytes, IPC_CREAT | 0777), 0);

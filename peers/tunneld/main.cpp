@@ -36,8 +36,9 @@ int main(int argc, char **argv) {
     lc_log_init("tunneld", nullptr, 0, COMPONENT_TUNNELD, LC_LOG_DEBUG,
                 lc_log_get_facility(nullptr, "tunneld"), 1);
     tunneld daemon;
-    tunneld_start(&daemon, options, stdout);
-    tunneld_run(&daemon);
+    const bool started = tunneld_start(&daemon, options, stdout);
+    if (started)
+        tunneld_run(&daemon);
     lc_log_close();
-    return 0;
+    return started ? 0 : 1;
 }

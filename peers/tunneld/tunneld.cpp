@@ -14,7 +14,6 @@
 
 #include <arpa/inet.h>
 #include <signal.h>
-#include <sys/shm.h>
 
 #include <ctime>
 
@@ -220,14 +219,11 @@ bool step(tunneld *daemon, bool *out_end) {
 
 } // namespace
 
-void tunneld_start(tunneld *daemon, const tunneld_options &options, FILE *out) {
+bool tunneld_start(tunneld *daemon, const tunneld_options &options, FILE *out) {
     daemon->options = options;
     daemon->out = out;
     daemon->next_index = options.first_index;
-    // Whether a block exists is seen through the registry, which a process attaches when it first asks for
-    // one.
-    if (void *block = cmem_attach_block(WCCP_MAILBOX_NAME))
-        shmdt(block);
+    return cmem_attach_registry(); // through which the mailbox is found once wccpd has created it
 }
 
 bool tunneld_step(tunneld *daemon) {

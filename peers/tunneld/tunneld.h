@@ -42,7 +42,8 @@ struct tunneld {
     std::map<uint16_t, uint32_t> roles;         // of policy groups, where not UNKNOWN
 };
 
-void tunneld_start(tunneld *daemon, const tunneld_options &options, FILE *out);
+// False, with a line in the log, when shared memory cannot be used.
+bool tunneld_start(tunneld *daemon, const tunneld_options &options, FILE *out);
 // Takes the pending command, if there is one. False when there was nothing to do.
 bool tunneld_step(tunneld *daemon);
 // Until SIGTERM, SIGINT or SIGHUP, which the caller has blocked.
