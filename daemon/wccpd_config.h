@@ -1,7 +1,6 @@
 // The configuration tree: read once at start, then followed change by change. Main thread only.
 #pragma once
 
-#include "engine/wccp_records.h"
 #include "mgmt/bnode.h"
 #include "runtime/common.h"
 
@@ -10,5 +9,3 @@ lc_status wccpd_config_query();
 lc_status wccpd_config_apply(bn_binding_array *new_values);
 // Of them only what concerns the log, which is there before the engine is.
 lc_status wccpd_config_apply_to_log(const bn_binding_array *new_values);
-// Fills the field of a node kind from a binding.
-lc_status wccpd_config_update_group_binding(wccp_grp_config *config, const bn_binding *binding, int kind);

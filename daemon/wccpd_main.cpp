@@ -57,8 +57,6 @@ uint32_t g_qv_encap_entry_count;
 uint32_t g_qv_encap_wccp_first, g_qv_encap_wccp_last;
 uint32_t g_qv_encap_clstr_first, g_qv_encap_clstr_last;
 
-constexpr const char *WCCPD_PID_FILE = "/var/run/wccpd.pid";
-
 const lc_enum_entry wccpd_status_table[] = {
     {0, "Initializing"},
     {1, "Ready"},
@@ -72,16 +70,35 @@ const lc_enum_entry wccpd_status_table[] = {
     {0, nullptr},
 };
 
+namespace {
+
+constexpr const char *WCCPD_PID_FILE = "/var/run/wccpd.pid";
+
 // The signals that the daemon takes, in the order of their registration and removal.
 struct wccpd_signal {
     int number;
     bool ends_daemon;
     lew_event *slot;
 };
-static wccpd_signal wccpd_signals[] = {
+wccpd_signal wccpd_signals[] = {
     {SIGHUP, true, nullptr},  {SIGINT, true, nullptr},   {SIGPIPE, false, nullptr},
     {SIGTERM, true, nullptr}, {SIGUSR1, false, nullptr}, {SIGUSR2, false, nullptr},
 };
+
+lc_status wccpd_alarms_init() {
+    return qv_alm_mgmt_init(wccpd_program_name);
+}
+
+// What the start waits for mgmtd in. An exit that begins in one of them ends the start there: nothing may be
+// brought up behind the back of what has been taken down.
+lc_status (*const wccpd_start_steps[])() = {
+    wccpd_mgmt_init,
+    wccpd_alarms_init,
+    wccpd_serv_init,
+    wccpd_config_query,
+};
+
+} // namespace
 
 int32_t wccpd_shutdown_in_progress() {
     return wccpd_exiting.load(std::memory_order_relaxed);
@@ -133,19 +150,6 @@ lc_status wccpd_serv_init() {
     (void)qv_encap_setup_entries();
     return wccp_init_mgr();
 }
-
-static lc_status wccpd_alarms_init() {
-    return qv_alm_mgmt_init(wccpd_program_name);
-}
-
-// What the start waits for mgmtd in. An exit that begins in one of them ends the start there: nothing may be
-// brought up behind the back of what has been taken down.
-static lc_status (*const wccpd_start_steps[])() = {
-    wccpd_mgmt_init,
-    wccpd_alarms_init,
-    wccpd_serv_init,
-    wccpd_config_query,
-};
 
 lc_status wccpd_init() {
     umask(0);

@@ -21,40 +21,42 @@
 
 gcl_session *wccpd_mgmt_session;
 mdc *wccpd_mcc;
-static gcl *wccpd_gcl_handle;
-static fdic *wccpd_fdic_handle;
-static fdic_libevent *wccpd_fdic_lew_handle;
-static int32_t wccpd_response_expected;
-static int32_t wccpd_expected_request_id;
-static bn_response_msg *wccpd_captured_response;
+namespace {
 
-static mgmt_client wccpd_client = {&wccpd_lwc,
-                                   &wccpd_mgmt_session,
-                                   &wccpd_mcc,
-                                   &wccpd_response_expected,
-                                   &wccpd_expected_request_id,
-                                   &wccpd_captured_response,
-                                   &wccpd_exiting,
-                                   "",
-                                   &wccpd_gcl_handle,
-                                   &wccpd_fdic_handle,
-                                   &wccpd_fdic_lew_handle};
+gcl *wccpd_gcl_handle;
+fdic *wccpd_fdic_handle;
+fdic_libevent *wccpd_fdic_lew_handle;
+int32_t wccpd_response_expected;
+int32_t wccpd_expected_request_id;
+bn_response_msg *wccpd_captured_response;
 
-static lc_status wccpd_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
-                                        bn_response_msg **out_response) {
+mgmt_client wccpd_client = {&wccpd_lwc,
+                            &wccpd_mgmt_session,
+                            &wccpd_mcc,
+                            &wccpd_response_expected,
+                            &wccpd_expected_request_id,
+                            &wccpd_captured_response,
+                            &wccpd_exiting,
+                            "",
+                            &wccpd_gcl_handle,
+                            &wccpd_fdic_handle,
+                            &wccpd_fdic_lew_handle};
+
+lc_status wccpd_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
+                                 bn_response_msg **out_response) {
     return mgmt_client_request(&wccpd_client, request, out_response);
 }
 
-static lc_status wccpd_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
+lc_status wccpd_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
     CHECK_STATUS(mgmt_client_response(&wccpd_client, response));
     return LC_OK;
 }
 
-static lc_status wccpd_mgmt_handle_event_response(gcl_session *, bn_response_msg *, void *) {
+lc_status wccpd_mgmt_handle_event_response(gcl_session *, bn_response_msg *, void *) {
     return LC_OK;
 }
 
-static lc_status wccpd_mgmt_handle_query_request(gcl_session *session, bn_request_msg *request, void *) {
+lc_status wccpd_mgmt_handle_query_request(gcl_session *session, bn_request_msg *request, void *) {
     if (m_daemon_status != WCCPD_READY) {
         LC_LOG(LC_LOG_INFO, "Discard event req because init not ready");
         return LC_OK;
@@ -64,7 +66,7 @@ static lc_status wccpd_mgmt_handle_query_request(gcl_session *session, bn_reques
     return LC_OK;
 }
 
-static lc_status wccpd_mgmt_handle_action_request(gcl_session *session, bn_request_msg *request, void *) {
+lc_status wccpd_mgmt_handle_action_request(gcl_session *session, bn_request_msg *request, void *) {
     uint16_t type = 0;
     CHECK_STATUS(bn_request_get(request, &type, nullptr, 0, nullptr, nullptr, nullptr));
     CHECK_CONDITION(type == bn_msg_action_request);
@@ -78,7 +80,7 @@ static lc_status wccpd_mgmt_handle_action_request(gcl_session *session, bn_reque
     return LC_OK;
 }
 
-static lc_status wccpd_process_proc_fail(const char *event_name, const bn_binding_array *bindings) {
+lc_status wccpd_process_proc_fail(const char *event_name, const bn_binding_array *bindings) {
     LC_LOG(LC_LOG_INFO, "Processing proc event: %s", event_name);
     bn_binding *first = bn_binding_array_get_quick(bindings, 0);
     if (!first)
@@ -94,7 +96,7 @@ static lc_status wccpd_process_proc_fail(const char *event_name, const bn_bindin
 
 // A change that comes before the engine is begun has no groups to change: the start reads the whole tree
 // later. The log's facility it reads from the file alone, and so what concerns the log is taken at once.
-static lc_status wccpd_config_changed(const char *, bn_binding_array *bindings) {
+lc_status wccpd_config_changed(const char *, bn_binding_array *bindings) {
     owned_bindings old_values, new_values;
     CHECK_STATUS(mdc_event_config_change_notif_extract(bindings, &old_values.pointer, &new_values.pointer));
     if (!wccpd_engine_begun) {
@@ -106,12 +108,12 @@ static lc_status wccpd_config_changed(const char *, bn_binding_array *bindings) 
     return LC_OK;
 }
 
-static lc_status wccpd_proc_event(const char *event_name, bn_binding_array *bindings) {
+lc_status wccpd_proc_event(const char *event_name, bn_binding_array *bindings) {
     CHECK_STATUS(wccpd_process_proc_fail(event_name, bindings));
     return LC_OK;
 }
 
-static const struct {
+const struct {
     const char *name;
     lc_status (*handle)(const char *event_name, bn_binding_array *bindings);
 } wccpd_events[] = {
@@ -121,7 +123,7 @@ static const struct {
     {EVENT_PROCESS_TERMINATE, wccpd_proc_event},
 };
 
-static lc_status wccpd_mgmt_handle_event_request(gcl_session *, bn_request_msg *request, void *) {
+lc_status wccpd_mgmt_handle_event_request(gcl_session *, bn_request_msg *request, void *) {
     uint16_t type = 0;
     owned_bindings bindings;
     CHECK_STATUS(bn_request_get(request, &type, nullptr, 0, &bindings.pointer, nullptr, nullptr));
@@ -141,7 +143,7 @@ static lc_status wccpd_mgmt_handle_event_request(gcl_session *, bn_request_msg *
     return LC_OK;
 }
 
-static lc_status wccpd_mgmt_handle_session_close(int, uint32_t, void *, void *) {
+lc_status wccpd_mgmt_handle_session_close(int, uint32_t, void *, void *) {
     if (wccpd_exiting)
         return LC_OK;
     wccpd_response_expected = 0;
@@ -150,7 +152,7 @@ static lc_status wccpd_mgmt_handle_session_close(int, uint32_t, void *, void *) 
     return LC_OK;
 }
 
-static lc_status wccpd_mgmt_register_interests() {
+lc_status wccpd_mgmt_register_interests() {
     CHECK_STATUS(mdc_send_action_with_bindings_str_va(
         wccpd_mcc, nullptr, nullptr, ACTION_ADD_INTEREST, 5,                           //
         "event_name", static_cast<uint32_t>(bn_type_name), EVENT_CONFIG_CHANGE,        //
@@ -171,7 +173,7 @@ static lc_status wccpd_mgmt_register_interests() {
     return LC_OK;
 }
 
-static lc_status wccpd_mgmt_open_session() {
+lc_status wccpd_mgmt_open_session() {
     lc_status status = mgmt_client_open(&wccpd_client, wccpd_program_name, wccpd_mgmt_msg_handler);
     if (status == LC_OK)
         status = wccpd_mgmt_register_interests();
@@ -179,6 +181,8 @@ static lc_status wccpd_mgmt_open_session() {
         LC_LOG(LC_LOG_ERR, "Unable to connect to the management daemon");
     return status;
 }
+
+} // namespace
 
 lc_status wccpd_mgmt_init() {
     CHECK_STATUS(mgmt_client_init(&wccpd_client, wccpd_mgmt_handle_session_close));

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <cstring>
 
+#include "mgmt/owners.h"
 #include "runtime/common.h"
 
 struct gcl_session;
@@ -15,6 +16,13 @@ extern mdc *wccpd_mcc;                  // what all mdc_ calls of the daemon are
 inline bool wccpd_is_under(const char *name, const char *root) {
     const size_t length = strlen(root);
     return strncmp(name, root, length) == 0 && name[length] == '/';
+}
+
+// The value of a string node; LC_NULL when it has none.
+inline lc_status wccpd_read_text(const bn_binding *binding, owned_tstring *out) {
+    CHECK_STATUS(bn_binding_get_tstr(binding, bn_attrib_value, bn_type_str, nullptr, &out->pointer));
+    CHECK_NULL(out->pointer);
+    return LC_OK;
 }
 
 lc_status wccpd_mgmt_init();

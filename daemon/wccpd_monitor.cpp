@@ -25,6 +25,8 @@
 #include "runtime/logging.h"
 #include "runtime/version.h"
 
+namespace {
+
 // Parts of a name below the state root, counted from 0.
 enum : uint32_t { GROUP_PART = 5, NUMBER_PART = 7, ADDRESS_PART = 9 };
 
@@ -54,16 +56,16 @@ struct mon_node {
     const mon_dump *dump;
 };
 
-static const char *address_text(be32 address, mon_value *out) {
+const char *address_text(be32 address, mon_value *out) {
     return get_addr_str(4, address, 0, out->text, 46);
 }
-static void put_number(mon_value *out, uint32_t number) {
+void put_number(mon_value *out, uint32_t number) {
     snprintf(out->text, sizeof out->text, "%d", static_cast<int>(number));
 }
-static void put_seconds_as_ms(mon_value *out, uint32_t seconds) {
+void put_seconds_as_ms(mon_value *out, uint32_t seconds) {
     snprintf(out->text, sizeof out->text, "%" PRId64, static_cast<int64_t>(seconds) * 1000);
 }
-static void put_words(mon_value *out, const char *words) {
+void put_words(mon_value *out, const char *words) {
     strlcpy(out->text, words, sizeof out->text);
 }
 
@@ -73,18 +75,18 @@ static void put_words(mon_value *out, const char *words) {
         statement;                                                                                           \
     }
 
-static const mon_dump global_dump = {
-    WCCP_DUMP_GLOBAL_BYTES, [](csys_display_buf *b, uint8_t) { return wccp_print_global(b); }, false};
-static const mon_dump all_dump = {
-    WCCP_DUMP_ALL_BYTES, [](csys_display_buf *b, uint8_t) { return wccp_print_all_wccp_info(b); }, false};
-static const mon_dump group_dump = {
+const mon_dump global_dump = {WCCP_DUMP_GLOBAL_BYTES,
+                              [](csys_display_buf *b, uint8_t) { return wccp_print_global(b); }, false};
+const mon_dump all_dump = {WCCP_DUMP_ALL_BYTES,
+                           [](csys_display_buf *b, uint8_t) { return wccp_print_all_wccp_info(b); }, false};
+const mon_dump group_dump = {
     WCCP_DUMP_GROUP_BYTES, [](csys_display_buf *b, uint8_t g) { return wccp_print_service_grp(b, g); }, true};
-static const mon_dump assignment_dump = {
+const mon_dump assignment_dump = {
     WCCP_DUMP_ASSIGNMENT_BYTES,
     [](csys_display_buf *b, uint8_t g) { return wccp_print_service_grp_assignment_details(g, b); }, false};
 
 // First match wins.
-static const mon_node mon_nodes[] = {
+const mon_node mon_nodes[] = {
     {NODE_WCCPD_STATE "/proto_ver", bn_type_str, VALUE(put_words(out, "2.0")), nullptr},
     {NODE_WCCPD_VERSION, bn_type_str, VALUE(put_words(out, wccp_version())), nullptr},
     {NODE_GROUP_STATE "/*/oper", bn_type_str, VALUE(put_words(out, s->group_info.oper)), nullptr},
@@ -122,36 +124,35 @@ static const mon_node mon_nodes[] = {
 };
 
 // Nodes that exist so that what iterate finds can be listed; they answer with their own last part.
-static const char *const wildcard_nodes[] = {
+const char *const wildcard_nodes[] = {
     NODE_GROUP_STATE "/*",
     NODE_GROUP_STATE "/*/router/*",
     NODE_GROUP_STATE "/*/router/*/appliance/*",
 };
 
-static bool matches(const mon_subject *subject, const char *pattern) {
+bool matches(const mon_subject *subject, const char *pattern) {
     return bn_binding_name_parts_pattern_match(subject->parts, 1, pattern) != 0;
 }
 
-static long number_part(const mon_subject *subject, uint32_t index) {
+long number_part(const mon_subject *subject, uint32_t index) {
     const char *text = tstr_array_get_str_quick(subject->parts, index);
     return text ? strtol(text, nullptr, 10) : 0;
 }
 
-static lc_status append_text(const char *name, uint32_t type, const char *text, bn_binding_array *out) {
+lc_status append_text(const char *name, uint32_t type, const char *text, bn_binding_array *out) {
     owned_binding binding;
     CHECK_STATUS(bn_binding_new_str(&binding.pointer, name, bn_attrib_value, type, 0, text));
     CHECK_STATUS(bn_binding_array_append_takeover(out, &binding.pointer));
     return LC_OK;
 }
 
-static lc_status wccpd_mon_handle_get_wildcard(const mon_subject *subject, const char *last,
-                                               bn_binding_array *out) {
+lc_status wccpd_mon_handle_get_wildcard(const mon_subject *subject, const char *last, bn_binding_array *out) {
     CHECK_STATUS(append_text(subject->name, bn_type_str, last, out));
     return LC_OK;
 }
 
 // Asks the engine for what the name is about. `answered` stays false where there is nothing to say.
-static lc_status ask_engine(mon_subject *subject, bool *answered) {
+lc_status ask_engine(mon_subject *subject, bool *answered) {
     char routers[64], appliances[64], router_appliances[96];
     *answered = true;
     if (!wccpd_is_under(subject->name, NODE_GROUP_STATE))
@@ -192,7 +193,7 @@ static lc_status ask_engine(mon_subject *subject, bool *answered) {
     return LC_OK;
 }
 
-static lc_status ask_load(mon_subject *subject, bool *answered) {
+lc_status ask_load(mon_subject *subject, bool *answered) {
     uint32_t address = 0;
     CHECK_STATUS(lc_str_to_ipv4addr(tstr_array_get_str_quick(subject->parts, ADDRESS_PART), &address));
     wccp_router_appliance_info info = {};
@@ -208,7 +209,7 @@ static lc_status ask_load(mon_subject *subject, bool *answered) {
     return LC_OK;
 }
 
-static lc_status append_dump(const mon_subject *subject, const mon_node *node, bn_binding_array *out) {
+lc_status append_dump(const mon_subject *subject, const mon_node *node, bn_binding_array *out) {
     const mon_dump *dump = node->dump;
     owned<void, wccp_free> memory(wccp_malloc(dump->size));
     if (!memory.pointer) {
@@ -222,6 +223,8 @@ static lc_status append_dump(const mon_subject *subject, const mon_node *node, b
     CHECK_STATUS(append_text(subject->name, node->type, csys_display_buf_text(buffer), out));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_parts, void *,
                                bn_binding_array *out) {
@@ -265,20 +268,22 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
     return LC_OK;
 }
 
-static lc_status append_name(tstr_array *out, const char *text) {
+namespace {
+
+lc_status append_name(tstr_array *out, const char *text) {
     owned_text copy(safe_strdup(text));
     CHECK_NULL(copy.pointer);
     CHECK_STATUS(tstr_array_append_str_takeover(out, &copy.pointer));
     return LC_OK;
 }
-static lc_status append_number(tstr_array *out, uint32_t number) {
+lc_status append_number(tstr_array *out, uint32_t number) {
     char text[16];
     snprintf(text, sizeof text, "%d", static_cast<int>(number));
     CHECK_STATUS(append_name(out, text));
     return LC_OK;
 }
 
-static lc_status iterate_router_appliances(const mon_subject *subject, tstr_array *out) {
+lc_status iterate_router_appliances(const mon_subject *subject, tstr_array *out) {
     wccp_router_appliance_list list = {};
     list.group_id = static_cast<uint8_t>(number_part(subject, GROUP_PART));
     list.router_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
@@ -292,7 +297,7 @@ static lc_status iterate_router_appliances(const mon_subject *subject, tstr_arra
     return LC_OK;
 }
 
-static lc_status iterate_routers(const mon_subject *subject, tstr_array *out) {
+lc_status iterate_routers(const mon_subject *subject, tstr_array *out) {
     wccp_router_list list = {};
     list.group_id = static_cast<uint8_t>(number_part(subject, GROUP_PART));
     const int status = wccp_get_router_list(&list);
@@ -305,7 +310,7 @@ static lc_status iterate_routers(const mon_subject *subject, tstr_array *out) {
     return LC_OK;
 }
 
-static lc_status iterate_groups(const mon_subject *, tstr_array *out) {
+lc_status iterate_groups(const mon_subject *, tstr_array *out) {
     static_assert(sizeof(wccp_grp_list) == 260);
     owned<void, wccp_free> memory(wccp_malloc(sizeof(wccp_grp_list)));
     wccp_grp_list *list = static_cast<wccp_grp_list *>(memory.pointer);
@@ -322,6 +327,8 @@ static lc_status iterate_groups(const mon_subject *, tstr_array *out) {
         CHECK_STATUS(append_number(out, list->ids[i]));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status wccpd_mon_handle_iterate(const char *node_name, const tstr_array *name_parts, void *,
                                    tstr_array *out) {

@@ -25,16 +25,12 @@ static lc_status connect_quietly(gcl_session *session) {
     return LC_OK;
 }
 
-static lc_status open_steps(mgmt_client *client, const char *client_name, mdc_send_function msg_handler) {
+lc_status mgmt_client_open(mgmt_client *client, const char *client_name, mdc_send_function msg_handler) {
     CHECK_STATUS(gcl_session_client_new(*client->instance, client_name, nullptr, 0, client->session));
     CHECK_QUIET(connect_quietly(*client->session));
     CHECK_STATUS(gcl_session_client_open_service_blocking(*client->session, 2, 2, nullptr, 0, -1));
     CHECK_STATUS(mdc_init(msg_handler, nullptr, nullptr, nullptr, *client->session, client->handle));
     return LC_OK;
-}
-
-lc_status mgmt_client_open(mgmt_client *client, const char *client_name, mdc_send_function msg_handler) {
-    return open_steps(client, client_name, msg_handler);
 }
 
 void mgmt_client_deinit(mgmt_client *client) {

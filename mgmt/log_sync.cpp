@@ -9,6 +9,8 @@
 #include "runtime/logging.h"
 #include "runtime/ttime.h"
 
+namespace {
+
 #define MESSAGES_FILE NODE_SYSLOG "/action/file/\\/var\\/log\\/messages"
 constexpr const char *SYSTEM_LEVEL = MESSAGES_FILE "/facility/all/min_priority";
 constexpr const char *OVERRIDE_ENABLE = MESSAGES_FILE "/facility/override/enable";
@@ -17,27 +19,25 @@ namespace {
 struct node_name {
     char text[160];
 };
-} // namespace
-
-static node_name process_level_node() {
+node_name process_level_node() {
     node_name name;
     snprintf(name.text, sizeof name.text, NODE_SYSLOG "/process/%s/log_level", lc_log_get_lls_process_name());
     return name;
 }
 // local0 is 0, local1 is 1.
-static int class_index() {
+int class_index() {
     int32_t facility = 0;
     (void)lc_log_get_syslog_facility(&facility);
     return ((facility >> 3) & 127) - 16;
 }
-static node_name class_level_node() {
+node_name class_level_node() {
     node_name name;
     snprintf(name.text, sizeof name.text, MESSAGES_FILE "/facility/single/local%d/min_priority",
              class_index());
     return name;
 }
 
-static lc_status read_text(mdc *session, const char *node, owned_tstring *out) {
+lc_status read_text(mdc *session, const char *node, owned_tstring *out) {
     owned_binding binding;
     CHECK_STATUS(mdc_get_binding(session, nullptr, nullptr, 0, &binding.pointer, node, nullptr));
     if (binding.pointer)
@@ -45,22 +45,24 @@ static lc_status read_text(mdc *session, const char *node, owned_tstring *out) {
             bn_binding_get_tstr(binding.pointer, bn_attrib_value, bn_type_str, nullptr, &out->pointer));
     return LC_OK;
 }
-static bool is_filled(const owned_tstring &text) {
+bool is_filled(const owned_tstring &text) {
     return text.pointer && ts_length(text.pointer) > 0;
 }
 
-static lc_status enable_class_override(const char *level) {
+lc_status enable_class_override(const char *level) {
     CHECK_STATUS(lc_log_enable_override_log_level(0, 1));
     CHECK_STATUS(lc_log_set_override_log_level(level));
     return LC_OK;
 }
 
-static lc_status set_daemon_level(const char *name) {
+lc_status set_daemon_level(const char *name) {
     int32_t level = 0;
     CHECK_QUIET(lc_string_to_enum(lc_log_level_table, name, &level));
     CHECK_STATUS(lc_log_set_daemon_log_level(level));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status qv_init_log_level(mdc *session) {
     owned_tstring system, own, override_level;
@@ -96,16 +98,18 @@ lc_status qv_read_log_facility(mdc *session, uint32_t *out_facility) {
     return LC_OK;
 }
 
+namespace {
+
 // --- A change event
 // -------------------------------------------------------------------------------------------------
 
-static lc_status value_text(const bn_binding *binding, owned_tstring *out) {
+lc_status value_text(const bn_binding *binding, owned_tstring *out) {
     CHECK_STATUS(bn_binding_get_tstr(binding, bn_attrib_value, 0, nullptr, &out->pointer));
     return LC_OK;
 }
 
 // Each step tells in `ended` whether what it found ends the operation.
-static lc_status change_process_level(const bn_binding *binding, bool *ended) {
+lc_status change_process_level(const bn_binding *binding, bool *ended) {
     owned_tstring value;
     uint32_t flags = 0;
     CHECK_STATUS(bn_binding_get_type(binding, bn_attrib_value, nullptr, &flags));
@@ -127,7 +131,7 @@ static lc_status change_process_level(const bn_binding *binding, bool *ended) {
     return LC_OK;
 }
 
-static lc_status change_system_level(const bn_binding *binding, bool *ended) {
+lc_status change_system_level(const bn_binding *binding, bool *ended) {
     owned_tstring value;
     CHECK_STATUS(value_text(binding, &value));
     *ended = value.pointer != nullptr;
@@ -138,7 +142,7 @@ static lc_status change_system_level(const bn_binding *binding, bool *ended) {
     return LC_OK;
 }
 
-static lc_status change_system_override(const bn_binding *binding, bool *) {
+lc_status change_system_override(const bn_binding *binding, bool *) {
     uint32_t value = 0;
     CHECK_STATUS(bn_binding_get_tbool(binding, bn_attrib_value, nullptr, &value));
     CHECK_STATUS(lc_log_enable_override_log_level(1, value ? 1 : 0));
@@ -146,7 +150,7 @@ static lc_status change_system_override(const bn_binding *binding, bool *) {
     return LC_OK;
 }
 
-static lc_status change_class_override(const bn_binding *binding, bool *) {
+lc_status change_class_override(const bn_binding *binding, bool *) {
     owned_tstring value;
     CHECK_STATUS(value_text(binding, &value));
     const int index = class_index();
@@ -160,6 +164,8 @@ static lc_status change_class_override(const bn_binding *binding, bool *) {
     }
     return LC_OK;
 }
+
+} // namespace
 
 lc_status qv_handle_log_level_change(const bn_binding_array *bindings) {
     if (!bindings)

@@ -1,6 +1,7 @@
 // The configuration applied to an engine that stands still: what a group is made of, what each change does,
 // and what is said of values that make no sense.
 #include "daemon/wccpd_config.h"
+#include "daemon/wccpd_group_nodes.h"
 #include "engine/wccp_utils.h"
 
 #include <map>
@@ -153,7 +154,7 @@ TEST_F(DaemonConfig, ProtocolsByNameAndNumber) {
         config.protocol = 99;
         binding_list list;
         list.add("/x", bn_type_str, text);
-        EXPECT_EQ(wccpd_config_update_group_binding(&config, list.last(), 3), LC_OK);
+        EXPECT_EQ(wccpd_config_update_group_binding(&config, list.last(), GROUP_NODE_PROTOCOL), LC_OK);
         EXPECT_EQ(config.protocol, protocol) << text;
         EXPECT_EQ(config.config_flags, 0u);
     }
@@ -191,7 +192,7 @@ TEST_F(DaemonConfig, WordsAreComparedExactly) {
     }
     wccp_grp_config config = {};
     list.add("/x", bn_type_str, "sixteen letters.");
-    EXPECT_EQ(wccpd_config_update_group_binding(&config, list.last(), 9), LC_OK);
+    EXPECT_EQ(wccpd_config_update_group_binding(&config, list.last(), GROUP_NODE_INTERFACE), LC_OK);
     EXPECT_STREQ(config.interface, "sixteen letters");
     EXPECT_EQ(config.interface_set, 1);
 }
@@ -212,7 +213,7 @@ TEST_F(DaemonConfig, RoutersInTheOrderOfTheirNumbersWithoutAGap) {
     for (uint32_t number = 1; number <= WCCP_MAX_ROUTERS + 1; number++) {
         config.config_flags = 0;
         list.add("/x", bn_type_ipv4addr, "10.0.1." + std::to_string(number));
-        EXPECT_EQ(wccpd_config_update_group_binding(&config, list.last(), 2), LC_OK);
+        EXPECT_EQ(wccpd_config_update_group_binding(&config, list.last(), GROUP_NODE_ROUTER), LC_OK);
         EXPECT_EQ(config.config_flags, WCCP_CFG_ROUTERS);
     }
     EXPECT_EQ(config.router_count, WCCP_MAX_ROUTERS);

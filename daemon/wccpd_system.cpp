@@ -1,5 +1,6 @@
-// Which interface is the appliance's primary WAN interface: told by the system mode and the bonding and speed
-// of its ports, which the management daemon knows. Main thread, from the engine's start.
+// What the engine asks about the system and mgmtd knows: whether it is a bridge, and which interface is the
+// primary WAN interface, chosen by the mode of the system and the bonding and speed of its ports. Main
+// thread, from the engine's start.
 #include <cstring>
 
 #include "daemon/wccpd_main.h"
@@ -13,8 +14,10 @@
 int32_t bonding_enabled;
 char wccp_primary_wan_interface_name[32];
 
+namespace {
+
 // A node that is absent leaves `out` as it is.
-static lc_status read_bool(mdc *handle, const char *node, int32_t *out, bool *out_present) {
+lc_status read_bool(mdc *handle, const char *node, int32_t *out, bool *out_present) {
     *out_present = false;
     owned_binding binding;
     CHECK_STATUS(mdc_get_binding(handle, nullptr, nullptr, 0, &binding.pointer, node, nullptr));
@@ -27,21 +30,21 @@ static lc_status read_bool(mdc *handle, const char *node, int32_t *out, bool *ou
     return LC_OK;
 }
 
-static lc_status mgmt_is_bonding_enabled(mdc *handle, int32_t *out) {
+lc_status mgmt_is_bonding_enabled(mdc *handle, int32_t *out) {
     bool present = false;
     *out = 0;
     CHECK_STATUS(read_bool(handle, NODE_SYSTEM_BONDING, out, &present));
     return LC_OK;
 }
 
-static lc_status mgmt_is_10g_enabled(mdc *handle, int32_t *out) {
+lc_status mgmt_is_10g_enabled(mdc *handle, int32_t *out) {
     bool present = false;
     *out = 0;
     CHECK_STATUS(read_bool(handle, NODE_SYSTEM_10G, out, &present));
     return LC_OK;
 }
 
-static lc_status choose_name(const char *mode, const char **out_name) {
+lc_status choose_name(const char *mode, const char **out_name) {
     if (bonding_enabled) {
         *out_name = "bwan0";
         return LC_OK;
@@ -61,18 +64,32 @@ static lc_status choose_name(const char *mode, const char **out_name) {
     return LC_OK;
 }
 
+lc_status read_system_mode(owned_tstring *out) {
+    owned_binding binding;
+    CHECK_STATUS(
+        mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, NODE_SYSTEM_MODE, nullptr));
+    CHECK_NULL(binding.pointer);
+    CHECK_STATUS(wccpd_read_text(binding.pointer, out));
+    return LC_OK;
+}
+
+} // namespace
+
+int wccp_is_system_in_bridge_mode() {
+    owned_tstring mode;
+    if (read_system_mode(&mode) != LC_OK)
+        return 0;
+    QV_LOG(LC_LOG_INFO, "WCCP current system mode: %s", ts_str(mode.pointer));
+    return strcmp(ts_str(mode.pointer), "bridge") == 0;
+}
+
 lc_status wccp_init_primary_wan_interface() {
     bool present = false;
     CHECK_STATUS(read_bool(wccpd_mcc, NODE_SYSTEM_BONDING, &bonding_enabled, &present));
     if (present)
         LC_LOG(LC_LOG_INFO, "bonding_enabled: %s", lc_bool_to_str(bonding_enabled));
-    owned_binding binding;
-    CHECK_STATUS(
-        mdc_get_binding(wccpd_mcc, nullptr, nullptr, 0, &binding.pointer, NODE_SYSTEM_MODE, nullptr));
-    CHECK_NULL(binding.pointer);
     owned_tstring mode;
-    CHECK_STATUS(bn_binding_get_tstr(binding.pointer, bn_attrib_value, bn_type_str, nullptr, &mode.pointer));
-    CHECK_NULL(mode.pointer);
+    CHECK_STATUS(read_system_mode(&mode));
     LC_LOG(LC_LOG_INFO, "system mode is %s", ts_str(mode.pointer));
     const char *name = nullptr;
     CHECK_STATUS(choose_name(ts_str(mode.pointer), &name));
