@@ -8,12 +8,12 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "daemon/protocol_names.h"
 #include "daemon/wccpd_mgmt.h"
 #include "engine/wccp_config.h"
 #include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"
 #include "mgmt/owners.h"
+#include "mgmt/protocol_names.h"
 #include "runtime/logging.h"
 
 struct group_node_words {
@@ -94,7 +94,7 @@ lc_status take_protocol(const group_node *, wccp_grp_config *config, const bn_bi
     owned_tstring text;
     CHECK_STATUS(wccpd_read_text(binding, &text));
     const char *string = ts_str(text.pointer);
-    long number = wccpd_protocol_by_name(string);
+    long number = ip_protocol_by_name(string);
     if (number < 0)
         number = strtol(string, nullptr, 10);
     if (number < 1 || number > 255) {

@@ -15,7 +15,6 @@ namespace {
 constexpr const char *SYSTEM_LEVEL = MESSAGES_FILE "/facility/all/min_priority";
 constexpr const char *OVERRIDE_ENABLE = MESSAGES_FILE "/facility/override/enable";
 
-namespace {
 struct node_name {
     char text[160];
 };

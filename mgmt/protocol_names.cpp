@@ -1,4 +1,4 @@
-#include "daemon/protocol_names.h"
+#include "mgmt/protocol_names.h"
 
 #include <cstdio>
 #include <cstring>
@@ -146,7 +146,7 @@ constexpr int NAMED = static_cast<int>(sizeof protocol_names / sizeof protocol_n
 constexpr int LAST_NUMBERED = 254;
 constexpr int RAW = 255;
 
-int wccpd_protocol_by_name(const char *name) {
+int ip_protocol_by_name(const char *name) {
     for (int number = 0; number < NAMED; number++)
         if (strcmp(protocol_names[number], name) == 0)
             return number;
