@@ -22,7 +22,6 @@
 
 constexpr const char *LEVEL_LINK = "/var/opt/rvl/output/sysloglevel";
 constexpr const char *TIME_ZONE_FILE = "/var/opt/rvl/output/localtime";
-constexpr const char *FACILITY_FILE = "/var/opt/rvl/syslog_fac.conf";
 constexpr int32_t DEFAULT_FACILITY = LOG_LOCAL1;
 
 std::atomic<int32_t> G_log_level{LC_LOG_NOTICE};
@@ -269,7 +268,7 @@ lc_status lc_log_get_syslog_facility(int32_t *out_facility) {
 }
 
 static void facility_from_file(const char *process_name, int32_t *facility) {
-    FILE *file = fopen(FACILITY_FILE, "re");
+    FILE *file = fopen(LC_LOG_FACILITY_FILE, "re");
     if (!file)
         return;
     char line[256];

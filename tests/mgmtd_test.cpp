@@ -5,6 +5,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
+#include <sstream>
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -18,6 +19,7 @@
 #include "peers/mgmtd/supervise.h"
 
 static const std::string GROUP = "/qv/wccpd/wccp/srv_grp/config/51";
+static const std::string POLICY = "/qv/wccpd/wccp/policy_grp/config";
 static const std::string STATE = "/qv/wccpd/wccp/srv_grp/state";
 
 static node_name named(const std::string &text) {
@@ -29,12 +31,10 @@ static node_name named(const std::string &text) {
 // --- The file
 
 static std::string errors_of(const std::string &content) {
-    node_tree tree;
-    config_comments comments;
-    std::string errors;
-    const bool good = config_parse(content, "F", &tree, &comments, &errors);
-    EXPECT_EQ(good, errors.empty());
-    return errors;
+    config_text text;
+    const bool good = config_parse(content, "F", &text);
+    EXPECT_EQ(good, text.errors.empty());
+    return text.errors;
 }
 
 TEST(ConfigFile, EachBadLineIsToldWithItsReason) {
@@ -44,7 +44,7 @@ TEST(ConfigFile, EachBadLineIsToldWithItsReason) {
     } cases[] = {
         {"[/qv/wccpd/wccp/srv_grp/config/256]\nweight = 1\n", "F:1: \"256\" is no number between 0 and 255"},
         {"[/qv/wccpd/wccp/srv_grp/config/051]\n", "F:1: \"051\" is no number between 0 and 255"},
-        {"[/qv/nobody]\n", "F:1: nothing stands below /qv/nobody"},
+        {"[/qv/nobody]\n", "F:1: nothing can be set below /qv/nobody"},
         {"weight = 1\n", "F:1: \"weight\" is no name from the root and stands in no section"},
         {section + "speed = 1\n", "F:2: " + GROUP + "/speed: there is no such node in the configuration"},
         {section + "weight\n", "F:2: expected [section] or name = value"},
@@ -61,7 +61,16 @@ TEST(ConfigFile, EachBadLineIsToldWithItsReason) {
         {section + "interface = \"eth0\n", "F:2: " + GROUP + "/interface: the closing quote is missing"},
         {"/logging/syslog/facility/system = 7\n",
          "F:1: /logging/syslog/facility/system: \"7\" is no log facility (a multiple of 8 up to 184)"},
+        {section + "protocol = htp\n",
+         "F:2: " + GROUP +
+             "/protocol: \"htp\" is no protocol; give a name such as tcp or udp, or a number from 1 to "
+             "255"},
+        {"/logging/syslog/process/a /log_level = debug\n",
+         "F:1: /logging/syslog/process/a /log_level: the part \"a \" of the name begins or ends with a "
+         "blank; write "
+         "it without"},
         // What only the whole shows.
+        {"[" + GROUP + "/router/1]\n", "F:1: " + GROUP + "/router/1: has no ipaddr"},
         {section + "router/1/ipaddr = 10.0.0.1\nrouter/3/ipaddr = 10.0.0.3\n",
          "F:3: " + GROUP + "/router: entries are numbered from 1 without a gap, number 2 is missing"},
         {section + "router/1/ipaddr = 10.0.0.1\nrouter/2/ipaddr = 10.0.0.1\nweight = 3\n",
@@ -88,17 +97,15 @@ TEST(ConfigFile, WhatIsWrittenReadsTheSameWithItsComments) {
                                 "[/logging/syslog/action/file]\n"
                                 "\\/var\\/log\\/messages/facility/all/min_priority = info\n"
                                 "# the end\n";
-    node_tree tree, again;
-    config_comments comments, comments_again;
-    std::string errors;
+    config_text text, again;
     // Two of ten routers: what is read and written doesn't depend on the whole being sound.
-    EXPECT_FALSE(config_parse(content, "F", &tree, &comments, &errors));
-    const std::string written = config_format(tree, comments);
-    (void)config_parse(written, "F", &again, &comments_again, &errors);
-    EXPECT_EQ(tree.set, again.set) << written;
-    EXPECT_EQ(config_format(again, comments_again), written);
-    EXPECT_EQ(again.set[named(GROUP + "/password")], " a\"b\\");
-    EXPECT_EQ(again.set[named(GROUP + "/mask_dst_ip")], "15");
+    EXPECT_FALSE(config_parse(content, "F", &text));
+    const std::string written = config_format(text.tree, text.comments);
+    (void)config_parse(written, "F", &again);
+    EXPECT_EQ(text.tree.set, again.tree.set) << written;
+    EXPECT_EQ(config_format(again.tree, again.comments), written);
+    EXPECT_EQ(again.tree.set[named(GROUP + "/password")], " a\"b\\");
+    EXPECT_EQ(again.tree.set[named(GROUP + "/mask_dst_ip")], "15");
     for (const char *line : {"# of the appliance\n[", "# slow link\nmask_dst_ip",
                              "# of the log\n[/logging/syslog/action/file/", "# the end\n"})
         EXPECT_NE(written.find(line), std::string::npos) << line << "\n" << written;
@@ -120,13 +127,15 @@ struct Mgmtd : testing::Test {
     server daemon;
     int64_t now = 1000;
     std::vector<sent_message> sent;
+    std::string said;
     char file[32] = "/tmp/mgmtd-test-XXXXXX";
 
     void SetUp() override {
         ASSERT_TRUE(mkdtemp(file));
-        daemon.config_file = std::string(file) + "/conf";
+        daemon.file.path = std::string(file) + "/conf";
         daemon.now_ms = [this] { return now; };
-        daemon.say = [](const std::string &) {};
+        daemon.say = [this](const std::string &line) { said += line + "\n"; };
+        daemon.local_addresses = [] { return std::vector<local_address>{{0x0a000065, 0x0a0000ff}}; };
         daemon.send = [this](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
             const owned_tbuffer buffer(frame);
             sent_message message{peer_id, mtype};
@@ -233,12 +242,13 @@ struct Mgmtd : testing::Test {
                 out.push_back(field.name + "=" + field.value.text);
         return out;
     }
-    // What the daemon makes of the change events that peer 1 was sent: "name=old>new", "-" for none.
-    std::vector<std::string> changes() {
-        std::vector<std::string> out;
+    // What the daemon makes of each change event that the peer was sent: "name=old>new", "-" for none.
+    std::vector<std::vector<std::string>> events(uint32_t peer_id = 1) {
+        std::vector<std::vector<std::string>> out;
         for (const sent_message &one : sent) {
-            if (one.peer != 1 || one.mtype != bn_msg_event)
+            if (one.peer != peer_id || one.mtype != bn_msg_event)
                 continue;
+            out.emplace_back();
             EXPECT_STREQ(ts_str(one.request->text), EVENT_CONFIG_CHANGE);
             owned_bindings bindings, old_values, new_values;
             EXPECT_EQ(bn_request_get(one.request, nullptr, nullptr, 0, &bindings.pointer, nullptr, nullptr),
@@ -253,11 +263,29 @@ struct Mgmtd : testing::Test {
                 (void)bn_binding_array_get_binding_by_name(old_values.pointer, name_of(binding).c_str(),
                                                            &old_value);
                 (void)bn_binding_get_type(binding, bn_attrib_value, nullptr, &flags);
-                out.push_back(name_of(binding) + "=" + (old_value ? value_of(old_value).text : "-") + ">" +
-                              (flags & bn_flag_deleted ? "-" : value_of(binding).text));
+                out.back().push_back(name_of(binding) + "=" + (old_value ? value_of(old_value).text : "-") +
+                                     ">" + (flags & bn_flag_deleted ? "-" : value_of(binding).text));
             }
         }
         return out;
+    }
+    std::vector<std::string> changes() {
+        std::vector<std::string> out;
+        for (const std::vector<std::string> &event : events())
+            out.insert(out.end(), event.begin(), event.end());
+        return out;
+    }
+    // The file with this content, and what mgmtd makes of it.
+    void reload(const std::string &content) {
+        std::ofstream(daemon.file.path) << content;
+        clear();
+        said.clear();
+        server_reload(&daemon);
+    }
+    std::string content() const {
+        std::ostringstream out;
+        out << std::ifstream(daemon.file.path).rdbuf();
+        return out.str();
     }
 };
 } // namespace
@@ -299,7 +327,10 @@ TEST_F(Mgmtd, ADeletedValueFallsBackToItsDefault) {
 }
 
 TEST_F(Mgmtd, ARefusedStepLeavesEverythingAsItWas) {
-    ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"}}), 0u);
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"},
+                   {bn_set_create, GROUP + "/policy_grp", "5"},
+                   {bn_set_create, POLICY + "/5", ""}}),
+              0u);
     const auto before = daemon.tree.set;
     const struct {
         set_node bad;
@@ -314,33 +345,157 @@ TEST_F(Mgmtd, ARefusedStepLeavesEverythingAsItWas) {
         {{bn_set_create, GROUP + "/router/2", ""}, LC_ASSERTION}, // no address
         {{bn_set_delete, GROUP + "/router/1/ipaddr", "", bn_type_none}, LC_ASSERTION},
         {{bn_set_reparent, GROUP, "", bn_type_none}, LC_NOT_IMPLEMENTED},
+        // What the file would not give back.
+        {{bn_set_create, "/logging/syslog/process/a\nb/log_level", "debug"}, LC_BAD_ARGUMENT},
+        {{bn_set_create, "/logging/syslog/process/a\x7f/log_level", "debug"}, LC_BAD_ARGUMENT},
+        {{bn_set_create, "/logging/syslog/process/ a/log_level", "debug"}, LC_BAD_ARGUMENT},
+        {{bn_set_create, "/logging/syslog/process/a\\\\/log_level", "debug"}, LC_BAD_ARGUMENT},
+        {{bn_set_create, "/logging/syslog/process/" + std::string(256, 'a') + "/log_level", "debug"},
+         LC_BAD_ARGUMENT},
+        // What cannot be a router.
+        {{bn_set_create, GROUP + "/router/2/ipaddr", "127.0.0.2"}, LC_ASSERTION},
+        {{bn_set_create, GROUP + "/router/2/ipaddr", "255.255.255.255"}, LC_ASSERTION},
+        {{bn_set_create, GROUP + "/router/2/ipaddr", "10.0.0.101"}, LC_ASSERTION},
+        {{bn_set_create, GROUP + "/router/2/ipaddr", "10.0.0.255"}, LC_ASSERTION},
+        {{bn_set_create, GROUP + "/router/2/ipaddr", "224.0.1.9"}, LC_ASSERTION},
+        {{bn_set_delete, POLICY + "/5", "", bn_type_none}, LC_ASSERTION},
     };
     for (const auto &one : cases) {
         EXPECT_EQ(set({{bn_set_modify, GROUP + "/admin", "down"}, one.bad}), static_cast<uint32_t>(one.code))
             << one.bad.name;
-        EXPECT_FALSE(message().empty()) << one.bad.name;
+        EXPECT_TRUE(message().starts_with(one.bad.name.substr(0, 6))) << one.bad.name << ": " << message();
+        EXPECT_EQ(message().find('\n'), std::string::npos) << message();
         EXPECT_EQ(changes(), strings{});
         EXPECT_EQ(daemon.tree.set, before) << one.bad.name;
     }
 }
 
+TEST_F(Mgmtd, ARunningGroupThatCannotFollowIsDeletedAndCreated) {
+    const std::string groups = "/qv/wccpd/wccp/srv_grp/config/";
+    action(3, "/mgmtd/events/actions/interest/add", {{"event_name", {bn_type_name, EVENT_CONFIG_CHANGE}}});
+    reload("[" + GROUP + "]\npolicy_grp = 5\nrouter/1/ipaddr = 10.0.0.1\n[" + groups + "7]\n[" + groups +
+           "9]\n");
+    const uint32_t revision = daemon.tree.revision;
+    const struct {
+        std::vector<set_node> nodes;
+        size_t events;
+    } cases[] = {
+        {{{bn_set_modify, GROUP + "/priority", "9"}, {bn_set_modify, GROUP + "/weight", "9"}}, 2},
+        {{{bn_set_modify, GROUP + "/protocol", "udp"}}, 2},
+        {{{bn_set_modify, GROUP + "/interface", "eth1"}}, 2},
+        {{{bn_set_modify, GROUP + "/router/1/ipaddr", "10.0.0.2"}}, 2},
+        {{{bn_set_create, GROUP + "/router/2/ipaddr", "10.0.0.3"}, {bn_set_modify, groups + "7/weight", "9"}},
+         3},
+        {{{bn_set_delete, GROUP + "/policy_grp", "", bn_type_none}}, 2},
+        // As it is, on purpose.
+        {{{bn_set_delete, groups + "7", "", bn_type_none}, {bn_set_create, groups + "7/weight", "9"}}, 2},
+        {{{bn_set_create, groups + "8", ""}, {bn_set_modify, GROUP + "/weight", "7"}}, 2},
+        {{{bn_set_modify, GROUP + "/encap", "l2"}, {bn_set_modify, GROUP + "/assign_detail", "x"}}, 1},
+        {{{bn_set_delete, GROUP + "/assign_detail", "", bn_type_none}}, 1},
+    };
+    for (const auto &one : cases) {
+        EXPECT_EQ(set(one.nodes), 0u) << message();
+        EXPECT_EQ(events().size(), one.events) << one.nodes[0].name;
+        EXPECT_LE(events(3).size(), 1u) << "one commit to everybody else";
+    }
+    EXPECT_EQ(daemon.tree.revision, revision + std::size(cases));
+
+    // All of it in one file: what goes, what follows, what comes.
+    reload("[" + GROUP + "]\npriority = 1\n[" + groups + "7]\nweight = 1\n[" + groups + "11]\n");
+    const auto told = events();
+    ASSERT_EQ(told.size(), 3u) << said;
+    EXPECT_TRUE(has(told[0], groups + "9=9>-") && has(told[0], GROUP + "=51>-") &&
+                has(told[0], GROUP + "/priority=9>-"));
+    EXPECT_EQ(told[1], strings{groups + "7/weight=9>1"});
+    EXPECT_TRUE(has(told[2], groups + "11=->11") && has(told[2], GROUP + "=->51") &&
+                has(told[2], GROUP + "/priority=->1"));
+
+    // No event is larger than it need be, and none has a part of a group.
+    std::string many;
+    for (int group = 100; group < 140; group++) {
+        many += "[" + groups + std::to_string(group) + "]\n";
+        for (int router = 1; router <= 32; router++)
+            many += "router/" + std::to_string(router) + "/ipaddr = 10.0.1." + std::to_string(router) + "\n";
+    }
+    reload(many);
+    EXPECT_GT(events().size(), 3u);
+    for (const auto &event : events()) {
+        EXPECT_TRUE(event.front().ends_with(">-") || event.front().find("=->1") != std::string::npos);
+        EXPECT_LT(event.size(), 1200u);
+    }
+}
+
 TEST_F(Mgmtd, TheFileHoldsEachCommitBeforeItIsTold) {
+    // Through a link whose target is yet to be.
+    const std::string real = daemon.file.path + ".real";
+    ASSERT_EQ(symlink("conf.real", daemon.file.path.c_str()), 0);
     ASSERT_EQ(set({{bn_set_create, GROUP + "/password", "secret"}}), 0u);
     struct stat about;
-    ASSERT_EQ(stat(daemon.config_file.c_str(), &about), 0);
-    EXPECT_EQ(about.st_mode & 0777, 0600u);
+    ASSERT_EQ(lstat(real.c_str(), &about), 0);
+    EXPECT_EQ(about.st_mode & 07777777, S_IFREG | 0600u);
     const auto before = daemon.tree.set;
-    // One that is bad, or gone, changes nothing when it is read again.
-    std::ofstream(daemon.config_file) << "[" << GROUP << "]\nweight = heavy\n";
-    clear();
-    server_reload(&daemon);
-    unlink(daemon.config_file.c_str());
-    server_reload(&daemon);
-    EXPECT_EQ(changes(), strings{});
-    daemon.config_file = std::string(file) + "/no/such/directory";
+    // One that is bad, or gone, changes nothing when it is read again, and is not written over.
+    const std::string bad = "[" + GROUP + "]\nweight = heavy\n";
+    reload(bad);
     EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "9"}}), static_cast<uint32_t>(LC_IO_ERROR));
+    EXPECT_NE(message().find("SIGHUP"), std::string::npos) << message();
+    EXPECT_EQ(content(), bad);
+    unlink(real.c_str());
+    server_reload(&daemon);
     EXPECT_EQ(changes(), strings{});
     EXPECT_EQ(daemon.tree.set, before);
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "9"}}), 0u) << message();
+    reload(content() + "weight = 9\n");
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "8"}}), static_cast<uint32_t>(LC_IO_ERROR));
+    reload("[" + GROUP + "]\nweight = 7\n");
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "8"}}), 0u) << message();
+
+    const auto kept = daemon.tree.set;
+    daemon.file.path = std::string(file) + "/no/such/directory";
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "9"}}), static_cast<uint32_t>(LC_IO_ERROR));
+    EXPECT_EQ(changes(), strings{});
+    EXPECT_EQ(daemon.tree.set, kept);
+}
+
+TEST_F(Mgmtd, AStartTidiesUpAndReportsWhatItCannotRefuse) {
+    const std::string left = daemon.file.path + ".unfinished";
+    daemon.facility_file = std::string(file) + "/new/facility";
+    std::ofstream(daemon.file.path) << "[" << GROUP << "]\nrouter/1/ipaddr = 10.0.0.101\n";
+    std::ofstream(left) << "[/qv";
+    chmod(daemon.file.path.c_str(), 0644);
+    std::string errors, warnings;
+    ASSERT_TRUE(server_load(&daemon, &errors, &warnings)) << errors;
+    EXPECT_TRUE(warnings.starts_with(daemon.file.path + ":2: " + GROUP +
+                                     "/router/1/ipaddr: 10.0.0.101 is an address "
+                                     "of this appliance"))
+        << warnings;
+    server_begin(&daemon);
+    EXPECT_NE(access(left.c_str(), F_OK), 0);
+    EXPECT_NE(said.find("mode 0644"), std::string::npos) << said;
+    struct stat about;
+    ASSERT_EQ(stat(daemon.file.path.c_str(), &about), 0);
+    EXPECT_EQ(about.st_mode & 0777, 0600u);
+
+    // A commit that has nothing to do with the address is taken, and so is the file with it.
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "8"}}), 0u) << message();
+    reload(content() + "weight = 9\n");
+    EXPECT_NE(said.find("configuration not read again"), std::string::npos) << said;
+    reload("[" + GROUP + "]\nrouter/1/ipaddr = 10.0.0.101\nweight = 9\n");
+    EXPECT_NE(said.find("/router/1/ipaddr: 10.0.0.101 is an address"), std::string::npos) << said;
+    EXPECT_EQ(changes(), strings{GROUP + "/weight=8>9"});
+    reload("[" + GROUP + "]\nrouter/1/ipaddr = 10.0.0.255\n");
+    EXPECT_EQ(changes(), strings{}) << said;
+
+    // The facility reaches the file that programs read when they start; its other lines stay.
+    const auto facility = [&] {
+        std::ostringstream out;
+        out << std::ifstream(daemon.facility_file).rdbuf();
+        return out.str();
+    };
+    EXPECT_EQ(facility(), "system 136\n");
+    std::ofstream(daemon.facility_file) << "# local\nflow 8\nsystem 16\n";
+    reload("[/logging/syslog/facility]\nsystem = 128\n");
+    EXPECT_EQ(facility(), "system 128\n# local\nflow 8\n");
 }
 
 TEST_F(Mgmtd, AnInterestHearsWhatItsPatternsName) {

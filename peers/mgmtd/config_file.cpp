@@ -7,26 +7,21 @@
 //   password = "with  blanks"
 //   /qv/wccpd/system/config/mcast_ttl = 4    a name from the root
 //
-// A section of an instance makes the instance, also without lines of its own. Values are taken from the first
-// character to the last that is no blank; in quotes \" and \\ stand for the characters themselves. Only what
-// was set is written, never a default.
-//
-// The file is written beside the old one, synced and renamed over it, so that whoever reads it, or a loss of
-// power, finds the old one or the new one. A file that is a link stays a link: its target is replaced.
+// A section of an instance makes the instance, also without lines of its own, and what it belongs to. A value
+// reaches from the first character to the last that is not blank; in quotes \" and \\ stand for the
+// characters themselves. Only what was set is written, never a default.
 #include "peers/mgmtd/config_file.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <climits>
-#include <cstdlib>
+#include <cstdio>
 #include <cstring>
 
 #include <fcntl.h>
-#include <libgen.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
-static constexpr size_t FILE_MAX_BYTES = 16u << 20;
+#include "peers/mgmtd/file_replace.h"
 
 static std::string trimmed(const std::string &text) {
     const size_t from = text.find_first_not_of(" \t\r");
@@ -67,13 +62,12 @@ static std::string quoted(const std::string &text) {
 
 namespace {
 struct parser {
-    node_tree *tree;
-    config_comments *comments;
-    std::string section; // "" or an absolute name
-    bool skipping;       // the section was refused, and its lines with it
-    std::string pending; // comment lines that wait for what they belong to
-    std::string heading; // those in front of a section of which nothing has come yet
-    std::map<node_name, int> line_of;
+    config_text *text;
+    int line = 0;
+    std::string section = {}; // "" or an absolute name
+    bool skipping = false;    // the section was refused, and its lines with it
+    std::string pending = {}; // comment lines that wait for what they belong to
+    std::string heading = {}; // those in front of a section of which nothing has come yet
 };
 } // namespace
 
@@ -94,8 +88,13 @@ static node_name section_of(const node_name &name) {
 // node.
 static void place_heading(parser *state, const node_name &name) {
     if (!state->heading.empty())
-        state->comments->before["[" + section_of(name).text() + "]"] += state->heading;
+        state->text->comments.before["[" + section_of(name).text() + "]"] += state->heading;
     state->heading.clear();
+}
+
+static void make_instances(parser *state, const node_name &name) {
+    for (const node_name &instance : instances_of(name))
+        state->text->tree.set[instance] = instance.parts.back();
 }
 
 static bool take_section(parser *state, const std::string &line, std::string *out_reason) {
@@ -110,7 +109,8 @@ static bool take_section(parser *state, const std::string &line, std::string *ou
     if (row && row->instance) {
         if (!check_value(*row, name, "", &text, out_reason))
             return false;
-        state->tree->set[name] = text;
+        make_instances(state, name);
+        state->text->lines.emplace(name, state->line);
     }
     bool known = false;
     for (const schema_row &candidate : schema()) {
@@ -121,7 +121,7 @@ static bool take_section(parser *state, const std::string &line, std::string *ou
         known = known || matches(above, name);
     }
     if (!known) {
-        *out_reason = "nothing stands below " + name.text();
+        *out_reason = "nothing can be set below " + shown_text(name.text());
         return false;
     }
     state->section = name.text();
@@ -132,7 +132,7 @@ static bool take_section(parser *state, const std::string &line, std::string *ou
     return true;
 }
 
-static bool take_value(parser *state, const std::string &line, int number, std::string *out_reason) {
+static bool take_value(parser *state, const std::string &line, std::string *out_reason) {
     const size_t equals = line.find('=');
     if (equals == std::string::npos) {
         *out_reason = "expected [section] or name = value";
@@ -140,7 +140,7 @@ static bool take_value(parser *state, const std::string &line, int number, std::
     }
     std::string name_text = trimmed(line.substr(0, equals)), value;
     if (name_text.empty() || (name_text[0] != '/' && state->section.empty())) {
-        *out_reason = "\"" + name_text + "\" is no name from the root and stands in no section";
+        *out_reason = "\"" + shown_text(name_text) + "\" is no name from the root and stands in no section";
         return false;
     }
     if (name_text[0] != '/')
@@ -148,78 +148,69 @@ static bool take_value(parser *state, const std::string &line, int number, std::
     node_name name;
     const schema_row *row = parse_node_name(name_text, &name) ? find_schema_row(name) : nullptr;
     if (!row) {
-        *out_reason = name_text + ": there is no such node in the configuration";
+        *out_reason = shown_text(name_text) + ": there is no such node in the configuration";
         return false;
     }
     std::string text;
     if (!unquoted(trimmed(line.substr(equals + 1)), &value, out_reason) ||
         !check_value(*row, name, value, &text, out_reason)) {
-        *out_reason = name.text() + ": " + *out_reason;
+        *out_reason = shown_text(name.text()) + ": " + *out_reason;
         return false;
     }
-    if (const auto [earlier, fresh] = state->line_of.emplace(name, number); !fresh) {
+    if (const auto [earlier, fresh] = state->text->lines.emplace(name, state->line);
+        !fresh && !row->instance) {
         *out_reason = name.text() + ": was given in line " + std::to_string(earlier->second) + " already";
         return false;
     }
-    state->tree->set[name] = text;
-    node_name above = name;
-    while (above.parts.size() > 1) {
-        above.parts.pop_back();
-        const schema_row *parent = find_schema_row(above);
-        if (parent && parent->instance)
-            state->tree->set[above] = above.parts.back();
-    }
+    make_instances(state, name);
+    state->text->tree.set[name] = text;
     place_heading(state, name);
     if (!state->pending.empty())
-        state->comments->before[name.text()] += state->pending;
+        state->text->comments.before[name.text()] += state->pending;
     state->pending.clear();
     return true;
 }
 
-bool config_parse(const std::string &content, const std::string &file, node_tree *out_tree,
-                  config_comments *out_comments, std::string *out_errors) {
-    out_tree->set.clear();
-    out_comments->before.clear();
-    out_errors->clear();
-    parser state{out_tree, out_comments, "", false, "", "", {}};
-    int number = 0;
+std::string config_complaint(const std::string &file, const std::map<node_name, int> &lines,
+                             const std::string &reason) {
+    // The line of the node, or of the last one below it.
+    const node_name about = parsed_name(reason.substr(0, reason.find(": ")));
+    int last = 0;
+    for (const auto &[name, line] : lines)
+        if (name == about || name.is_under(about))
+            last = std::max(last, line);
+    return file + ":" + (last ? std::to_string(last) + ": " : " ") + reason + "\n";
+}
+
+static bool take_line(parser *state, const std::string &line, std::string *out_reason) {
+    if (line[0] == '[') {
+        const bool good = take_section(state, line, out_reason);
+        state->skipping = !good;
+        return good;
+    }
+    return state->skipping || take_value(state, line, out_reason);
+}
+
+bool config_parse(const std::string &content, const std::string &file, config_text *out) {
+    *out = {};
+    parser state{out};
     for (size_t at = 0; at < content.size();) {
         const size_t end = std::min(content.find('\n', at), content.size());
         const std::string line = trimmed(content.substr(at, end - at));
-        at = end + 1;
-        number++;
         std::string reason;
-        if (line.empty())
-            continue;
-        if (line[0] == '#') {
+        at = end + 1;
+        state.line++;
+        if (!line.empty() && line[0] == '#')
             state.pending += line + "\n";
-            continue;
-        }
-        bool good = true;
-        if (line[0] == '[') {
-            good = take_section(&state, line, &reason);
-            state.skipping = !good;
-        } else if (!state.skipping) {
-            good = take_value(&state, line, number, &reason);
-        }
-        if (!good)
-            out_errors->append(file).append(":" + std::to_string(number) + ": ").append(reason + "\n");
+        else if (!line.empty() && !take_line(&state, line, &reason))
+            out->errors.append(file).append(":" + std::to_string(state.line) + ": ").append(reason + "\n");
     }
     if (const std::string last = state.heading + state.pending; !last.empty())
-        out_comments->before[""] = last;
-    tree_refresh(out_tree);
-    std::string reason;
-    if (out_errors->empty() && !tree_check(*out_tree, &reason)) {
-        // The line of the node that the reason begins with, or of the last one below it.
-        node_name about;
-        int line = 0;
-        (void)parse_node_name(reason.substr(0, reason.find(": ")), &about);
-        for (const auto &[name, given] : state.line_of)
-            if (name == about || name.is_under(about))
-                line = std::max(line, given);
-        *out_errors = file + ":" + (line ? std::to_string(line) + ": " : " ") + reason + "\n";
-    }
-    return out_errors->empty();
+        out->comments.before[""] = last;
+    tree_refresh(&out->tree);
+    if (std::string reason; out->errors.empty() && !tree_check(out->tree, &reason))
+        out->errors = config_complaint(file, out->lines, reason);
+    return out->errors.empty();
 }
 
 std::string config_format(const node_tree &tree, const config_comments &comments) {
@@ -246,80 +237,63 @@ std::string config_format(const node_tree &tree, const config_comments &comments
 
 // --- Files
 
-static bool read_all(int fd, std::string *out) {
-    char bytes[65536];
-    ssize_t got;
-    while ((got = read(fd, bytes, sizeof bytes)) != 0) {
-        if (got < 0 && errno != EINTR)
-            return false;
-        if (got > 0)
-            out->append(bytes, static_cast<size_t>(got));
-        if (out->size() > FILE_MAX_BYTES) {
-            errno = EFBIG;
-            return false;
-        }
-    }
-    return true;
-}
-
-bool config_load(const std::string &file, node_tree *out_tree, config_comments *out_comments,
-                 std::string *out_errors) {
-    std::string content;
-    const int fd = open(file.c_str(), O_RDONLY | O_CLOEXEC);
-    const bool missing = fd < 0 && errno == ENOENT;
-    const bool read_whole = fd >= 0 && read_all(fd, &content);
-    const std::string failure = strerror(errno);
-    if (fd >= 0)
-        close(fd);
-    if (!missing && !read_whole) {
-        *out_errors = file + ": " + failure + "\n";
-        return false;
-    }
-    return config_parse(content, file, out_tree, out_comments, out_errors);
-}
-
-static bool write_whole(int fd, const std::string &content) {
-    for (size_t done = 0; done < content.size();) {
-        const ssize_t wrote = write(fd, content.data() + done, content.size() - done);
-        if (wrote < 0 && errno != EINTR)
-            return false;
-        if (wrote > 0)
-            done += static_cast<size_t>(wrote);
-    }
-    return fsync(fd) == 0;
-}
-
-static void sync_directory(const std::string &file) {
-    std::string copy = file;
-    const int fd = open(dirname(copy.data()), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd >= 0) {
-        (void)fsync(fd);
-        close(fd);
-    }
-}
-
-bool config_save(const std::string &file, const node_tree &tree, const config_comments &comments,
-                 std::string *out_error) {
-    char resolved[PATH_MAX];
-    const std::string target = realpath(file.c_str(), resolved) ? resolved : file;
-    std::string fresh = target + ".XXXXXX";
-    const int fd = mkostemp(fresh.data(), O_CLOEXEC); // mode 0600
-    bool saved = fd >= 0 && write_whole(fd, config_format(tree, comments));
-    std::string failure = strerror(errno);
-    if (fd >= 0 && close(fd) != 0 && saved) {
-        saved = false;
-        failure = strerror(errno);
-    }
-    if (saved && rename(fresh.c_str(), target.c_str()) != 0) {
-        saved = false;
-        failure = strerror(errno);
-    }
-    if (saved) {
-        sync_directory(target);
+bool config_load(config_file *file, config_text *out) {
+    std::string reason;
+    if (std::optional<std::string> content; !read_whole_file(file->path, &content, &reason)) {
+        out->errors = file->path + ": " + reason + "\n";
+    } else if (config_parse(content.value_or(""), file->path, out)) {
+        file->seen = std::move(content);
         return true;
     }
-    if (fd >= 0)
-        unlink(fresh.c_str());
-    *out_error = file + ": " + failure;
     return false;
+}
+
+// Of a file that is gone nothing is lost.
+static bool is_as_seen(const config_file &file, std::string *out_reason) {
+    std::optional<std::string> now;
+    if (!read_whole_file(file.path, &now, out_reason))
+        return false;
+    if (!now || now == file.seen)
+        return true;
+    *out_reason =
+        "it was changed since mgmtd read it; have mgmtd read it (SIGHUP), or move it away, and commit "
+        "again";
+    return false;
+}
+
+static bool reads_the_same(const std::string &written, const node_tree &tree, std::string *out_reason) {
+    config_text again;
+    if (config_parse(written, "what was written", &again) && again.tree.set == tree.set)
+        return true;
+    *out_reason =
+        "what was written would not be read the same: " + again.errors.substr(0, again.errors.find('\n'));
+    return false;
+}
+
+bool config_save(config_file *file, const node_tree &tree, const config_comments &comments,
+                 std::string *out_reason) {
+    const std::string content = config_format(tree, comments);
+    const bool saved = replace_file(
+        file->path, content, S_IRUSR | S_IWUSR,
+        [&](const std::string &written, std::string *out) {
+            return reads_the_same(written, tree, out) && is_as_seen(*file, out);
+        },
+        out_reason);
+    if (saved)
+        file->seen = content;
+    else
+        *out_reason = file->path + ": " + *out_reason;
+    return saved;
+}
+
+std::string config_protect(const std::string &path) {
+    struct stat about;
+    if (stat(path.c_str(), &about) != 0 || (about.st_mode & (S_IRWXG | S_IRWXO)) == 0)
+        return "";
+    char mode[8];
+    snprintf(mode, sizeof mode, "%04o", about.st_mode & 07777u);
+    const std::string found = "the configuration file " + path + " was open to others (mode " + mode + "), ";
+    if (chmod(path.c_str(), about.st_mode & S_IRWXU) == 0)
+        return found + "and is no longer; change the passwords in it if others may have read them";
+    return found + "and its mode can't be changed (" + strerror(errno) + "): make it 0600";
 }

@@ -83,14 +83,13 @@ int main(int argc, char **argv) {
     lc_log_init("mgmtd", nullptr, 0, COMPONENT_MGMTD, LC_LOG_NOTICE, lc_log_get_facility(nullptr, "mgmtd"),
                 1);
     server daemon;
-    std::string errors;
-    if (!config_load(config, &daemon.tree, &daemon.comments, &errors)) {
-        fputs(errors.c_str(), stderr);
-        return 1;
-    }
-    if (check)
-        return 0;
-    daemon.config_file = config;
+    std::string errors, warnings;
+    daemon.file.path = config;
+    const bool good = server_load(&daemon, &errors, &warnings);
+    fputs((errors + warnings).c_str(), stderr);
+    if (check || !good)
+        return good ? 0 : 1;
+    daemon.facility_file = LC_LOG_FACILITY_FILE;
     daemon.now_ms = lt_monotonic_ms;
     daemon.say = say;
 
@@ -101,6 +100,7 @@ int main(int argc, char **argv) {
         transport_close(&sockets);
         return 1;
     }
+    server_begin(&daemon);
     say("mgmtd ready, " + std::to_string(daemon.tree.nodes.size()) + " nodes");
 
     supervisor processes;

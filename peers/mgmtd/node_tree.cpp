@@ -1,18 +1,23 @@
 // The tree and its commits.
 //
 // A commit works on a copy: the steps are carried out one by one, then the whole is checked, written to the
-// configuration file and only then takes the old tree's place. What goes to the sessions is the difference
-// of the two as they hold, defaults in them: a new group is its root and all of its children, and a node that
-// is deleted and has a default is a change back to that default.
+// configuration file and only then replaces the old tree. The changes of a commit are the difference of the
+// nodes of both trees, defaults included: a new group is its root and all of its children, and a node that is
+// deleted and has a default is changed back to that default.
 //
-// A child that is created brings the instance it belongs to along; a child of an instance that isn't there
-// can't be modified, so that a mistyped number makes no new group.
+// Creating a child creates the instances that it belongs to. Modifying a child of an instance that does not
+// exist is refused, so that a mistyped number makes no new group.
 #include "peers/mgmtd/node_tree.h"
 
 #include <bit>
 #include <set>
 
 #include "mgmt/bnode_types.h"
+#include "mgmt/node_paths.h"
+
+static const node_name service_groups = parsed_name(NODE_GROUP_CONFIG);
+static const node_name policy_groups = parsed_name(NODE_POLICY_CONFIG);
+static const node_name policy_membership = parsed_name(NODE_GROUP_CONFIG "/*/policy_grp");
 
 static bool has_wildcard(const node_name &pattern) {
     for (const std::string &part : pattern.parts)
@@ -21,8 +26,7 @@ static bool has_wildcard(const node_name &pattern) {
     return false;
 }
 
-// Instances that the node belongs to, from the top, itself included when it is one.
-static std::vector<node_name> instances_of(const node_name &name) {
+std::vector<node_name> instances_of(const node_name &name) {
     std::vector<node_name> out;
     node_name above;
     for (const std::string &part : name.parts) {
@@ -108,9 +112,8 @@ static bool check_masks(const node_tree &tree, const node_name &group, std::stri
 }
 
 bool tree_check(const node_tree &tree, std::string *out_reason) {
-    static const node_name groups = {{"qv", "wccpd", "wccp", "srv_grp", "config"}};
     node_list roots;
-    collect_nodes(tree.nodes, groups, {false, false, false}, &roots);
+    collect_nodes(tree.nodes, service_groups, {false, false, false}, &roots);
     for (const auto *root : roots)
         if (!check_routers(tree, root->first, out_reason) || !check_masks(tree, root->first, out_reason))
             return false;
@@ -136,7 +139,7 @@ void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk,
 // --- Commits
 
 static commit_result refused(uint32_t code, const std::string &name, const std::string &reason) {
-    return {code, name + ": " + reason, {}};
+    return {code, shown_text(name) + ": " + reason, {}, {}};
 }
 
 static commit_result remove_step(node_tree *tree, const set_step &step, const node_name &name) {
@@ -195,6 +198,18 @@ std::vector<node_change> tree_difference(const node_map &before, const node_map 
     return changes;
 }
 
+static std::vector<node_name> renewed_by(const node_tree &before, const std::vector<set_step> &steps,
+                                         const node_tree &after) {
+    std::vector<node_name> out;
+    for (const set_step &step : steps) {
+        node_name name;
+        if (step.kind == set_kind::remove && parse_node_name(step.name, &name) &&
+            find_schema_row(name)->instance && before.nodes.contains(name) && after.nodes.contains(name))
+            out.push_back(name);
+    }
+    return out;
+}
+
 commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &steps, node_tree *out_next) {
     out_next->set = tree.set;
     out_next->revision = tree.revision + 1;
@@ -213,6 +228,21 @@ commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &s
     tree_refresh(out_next);
     std::string reason;
     if (!tree_check(*out_next, &reason))
-        return {LC_ASSERTION, reason, {}};
-    return {0, "", tree_difference(tree.nodes, out_next->nodes)};
+        return {LC_ASSERTION, reason, {}, {}};
+    return {0, "", tree_difference(tree.nodes, out_next->nodes), renewed_by(tree, steps, *out_next)};
+}
+
+bool tree_check_change(const node_tree &before, const node_tree &after, std::string *out_reason) {
+    for (const auto &[name, value] : after.nodes) {
+        if (!matches(policy_membership, name))
+            continue;
+        const node_name policy = policy_groups.below(value.text);
+        if (!before.nodes.contains(policy) || after.nodes.contains(policy))
+            continue;
+        const std::string group = name.parts[name.parts.size() - 2];
+        *out_reason = policy.text() + ": service group " + group +
+                      " is in it; delete or change the policy_grp of the service group first, or with it";
+        return false;
+    }
+    return true;
 }

@@ -46,24 +46,15 @@ struct commit_result {
     uint32_t code; // 0, or a status code
     std::string message;
     std::vector<node_change> changes; // in the order of the tree
+    std::vector<node_name> renewed;   // instances that the steps removed and created again
 };
-// All of the steps or none of them. The tree changes only when `keep`, given the tree as it would be, agrees.
-template <typename Keep>
-commit_result tree_commit(node_tree *tree, const std::vector<set_step> &steps, Keep keep);
 
 std::vector<node_change> tree_difference(const node_map &before, const node_map &after);
 
-// The halves of a commit.
+// The tree as it would be after all of the steps; or why not one of them can be taken.
 commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &steps, node_tree *out_next);
+// What only a change shows, as opposed to the tree that it leads to: false with the reason.
+bool tree_check_change(const node_tree &before, const node_tree &after, std::string *out_reason);
 
-template <typename Keep>
-commit_result tree_commit(node_tree *tree, const std::vector<set_step> &steps, Keep keep) {
-    node_tree next;
-    commit_result result = tree_prepare(*tree, steps, &next);
-    if (result.code != 0 || (result.changes.empty() && next.set == tree->set))
-        return result;
-    if (!keep(next, &result))
-        return result;
-    *tree = std::move(next);
-    return result;
-}
+// The instances that the node belongs to, from the top, itself included when it is one.
+std::vector<node_name> instances_of(const node_name &name);

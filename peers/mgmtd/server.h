@@ -10,6 +10,7 @@
 #include "peers/mgmtd/config_file.h"
 #include "peers/mgmtd/messages.h"
 #include "peers/mgmtd/node_tree.h"
+#include "peers/mgmtd/router_addresses.h"
 
 constexpr int64_t MONITOR_TIMEOUT_MS = 5000;
 constexpr size_t ALARMS_MAX = 4096; // that are kept
@@ -40,8 +41,10 @@ struct server {
     std::function<void(uint32_t peer_id, uint16_t mtype, tbuffer *frame)> send;
     std::function<int64_t()> now_ms; // monotonic
     std::function<void(const std::string &line)> say;
-    std::string config_file; // "" keeps the configuration in memory only
+    std::function<std::vector<local_address>()> local_addresses = find_local_addresses;
+    std::string facility_file; // where programs read the log facility when they start; "": nowhere
 
+    config_file file;
     node_tree tree;
     config_comments comments;
     node_map state; // nodes that mgmtd itself reports
@@ -64,7 +67,13 @@ void server_send_event(server *self, const std::string &event, const std::vector
 void server_process_event(server *self, const std::string &event, const std::string &process);
 commit_result server_commit(server *self, const std::vector<set_step> &steps, const std::string &who);
 
-// The configuration file is read again and what differs is told as one commit; a bad file changes nothing.
+// Reads the configuration file. False with its errors; what is to be reported of a file that is good all the
+// same goes to the warnings. Both are lines.
+bool server_load(server *self, std::string *out_errors, std::string *out_warnings);
+// Before the first session, once no other mgmtd can use the files: tidies up around the configuration file,
+// and writes the facility.
+void server_begin(server *self);
+// The configuration file is read again and what differs is one commit; a bad file changes nothing.
 void server_reload(server *self);
 
 // The parts of it, for each other.

@@ -4,9 +4,9 @@
 // a range, a length, words or a check of its own. Numbers may be written in hexadecimal, as masks are thought
 // of, and are kept in decimal.
 //
-// Defaults are given so that a group of which only the interface and the routers are said takes part. A text
-// that may be empty has the empty text as default, because a node that is deleted and has no default takes
-// its whole group out of the daemon.
+// The defaults are such that a group takes part once its interface and its routers are set. A text that may be
+// empty has the empty text as its default: deleting a node of a group that has no default costs a running
+// group its place, since it is deleted and created again.
 #include "peers/nodes/schema.h"
 
 #include <algorithm>
@@ -16,8 +16,12 @@
 #include "mgmt/bnode.h"
 #include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
+#include "mgmt/protocol_names.h"
 #include "peers/nodes/binding_text.h"
 #include "runtime/logging.h"
+
+static constexpr size_t PART_MAX_BYTES = 255;  // of a name
+static constexpr size_t SHOWN_MAX_BYTES = 400; // of a text in a message
 
 static const char *check_level(const std::string &text) {
     int32_t level = 0;
@@ -36,13 +40,13 @@ static const char *check_facility(const std::string &text) {
 
 static const char *check_protocol(const std::string &text) {
     const bool digits = !text.empty() && text.find_first_not_of("0123456789") == std::string::npos;
-    if (digits && (text.size() > 3 || text == "0" || std::stoi(text) < 1 || std::stoi(text) > 255))
-        return "is not between 1 and 255";
-    if (text == "ip")
+    if (digits)
+        return text.size() > 3 || std::stoi(text) < 1 || std::stoi(text) > 255 ? "is not between 1 and 255"
+                                                                               : nullptr;
+    const int number = ip_protocol_by_name(text.c_str());
+    if (number == 0)
         return "is no protocol of its own; name one that is carried in it";
-    if (text.find_first_not_of("abcdefghijklmnopqrstuvwxyz0123456789-+") != std::string::npos)
-        return "is no protocol name";
-    return nullptr;
+    return number < 0 ? "is no protocol; give a name such as tcp or udp, or a number from 1 to 255" : nullptr;
 }
 
 static const char *check_interface(const std::string &text) {
@@ -57,44 +61,44 @@ static const char *check_interface(const std::string &text) {
 static const std::vector<schema_row> rows = [] {
     constexpr int64_t NUMBER_MAX = 0xffffffff;
     std::vector<schema_row> made = {
-        {NODE_SYSTEM_MODE, bn_type_str, "router", 1, 15, "router|server|bridge", nullptr, false, {}},
-        {NODE_SYSTEM_BONDING, bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {NODE_SYSTEM_10G, bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {NODE_MCAST_TTL, bn_type_uint32, "1", 1, 255, nullptr, nullptr, false, {}},
+        {NODE_SYSTEM_MODE, bn_type_str, "router", 1, 15, "router|server|bridge", nullptr},
+        {NODE_SYSTEM_BONDING, bn_type_bool, "false", 0, 0, nullptr, nullptr},
+        {NODE_SYSTEM_10G, bn_type_bool, "false", 0, 0, nullptr, nullptr},
+        {NODE_MCAST_TTL, bn_type_uint32, "1", 1, 255, nullptr, nullptr},
 
-        {POLICY, bn_type_uint16, nullptr, 1, 65535, nullptr, nullptr, true, {}},
-        {POLICY "/name", bn_type_str, "", 0, 63, nullptr, nullptr, false, {}},
+        {POLICY, bn_type_uint16, nullptr, 1, 65535, nullptr, nullptr, true},
+        {POLICY "/name", bn_type_str, "", 0, 63, nullptr, nullptr},
 
-        {GROUP, bn_type_uint8, nullptr, 0, 255, nullptr, nullptr, true, {}},
-        {GROUP "/admin", bn_type_str, "up", 1, 15, "up|down", nullptr, false, {}},
-        {GROUP "/interface", bn_type_str, nullptr, 1, 15, nullptr, check_interface, false, {}},
-        {GROUP "/router/*", bn_type_uint8, nullptr, 1, 32, nullptr, nullptr, true, {}},
-        {GROUP "/router/*/ipaddr", bn_type_ipv4addr, nullptr, 0, 0, nullptr, nullptr, false, {}},
-        {GROUP "/priority", bn_type_uint32, "200", 0, 255, nullptr, nullptr, false, {}},
-        {GROUP "/protocol", bn_type_str, "tcp", 1, 31, nullptr, check_protocol, false, {}},
-        {GROUP "/password", bn_type_str, "", 0, 8, nullptr, nullptr, false, {}},
-        {GROUP "/encap", bn_type_str, "either", 1, 15, "gre|l2|either", nullptr, false, {}},
-        {GROUP "/weight", bn_type_uint32, "100", 0, 65535, nullptr, nullptr, false, {}},
-        {GROUP "/policy_grp", bn_type_uint32, nullptr, 1, 65535, nullptr, nullptr, false, {}},
-        {GROUP "/force_l2_return", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {GROUP "/assign_method", bn_type_str, "either", 1, 15, "hash|mask|either", nullptr, false, {}},
-        {GROUP "/assign_detail", bn_type_str, nullptr, 0, 255, nullptr, nullptr, false, {}},
-        {GROUP "/hash_src_ip", bn_type_bool, "true", 0, 0, nullptr, nullptr, false, {}},
-        {GROUP "/hash_dst_ip", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {GROUP "/hash_src_port", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {GROUP "/hash_dst_port", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {GROUP "/mask_src_ip", bn_type_uint32, "0", 0, NUMBER_MAX, nullptr, nullptr, false, {}},
-        {GROUP "/mask_dst_ip", bn_type_uint32, "3840", 0, NUMBER_MAX, nullptr, nullptr, false, {}},
-        {GROUP "/mask_src_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr, false, {}},
-        {GROUP "/mask_dst_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr, false, {}},
-        {GROUP "/compatibility", bn_type_str, "ios", 1, 15, "ios|nexus", nullptr, false, {}},
+        {GROUP, bn_type_uint8, nullptr, 0, 255, nullptr, nullptr, true},
+        {GROUP "/admin", bn_type_str, "up", 1, 15, "up|down", nullptr},
+        {GROUP "/interface", bn_type_str, nullptr, 1, 15, nullptr, check_interface, false, true},
+        {GROUP "/router/*", bn_type_uint8, nullptr, 1, 32, nullptr, nullptr, true},
+        {GROUP "/router/*/ipaddr", bn_type_ipv4addr, nullptr, 0, 0, nullptr, nullptr, false, true},
+        {GROUP "/priority", bn_type_uint32, "200", 0, 255, nullptr, nullptr, false, true},
+        {GROUP "/protocol", bn_type_str, "tcp", 1, 31, nullptr, check_protocol, false, true},
+        {GROUP "/password", bn_type_str, "", 0, 8, nullptr, nullptr},
+        {GROUP "/encap", bn_type_str, "either", 1, 15, "gre|l2|either", nullptr},
+        {GROUP "/weight", bn_type_uint32, "100", 0, 65535, nullptr, nullptr},
+        {GROUP "/policy_grp", bn_type_uint32, nullptr, 1, 65535, nullptr, nullptr},
+        {GROUP "/force_l2_return", bn_type_bool, "false", 0, 0, nullptr, nullptr},
+        {GROUP "/assign_method", bn_type_str, "either", 1, 15, "hash|mask|either", nullptr},
+        {GROUP "/assign_detail", bn_type_str, "", 0, 255, nullptr, nullptr},
+        {GROUP "/hash_src_ip", bn_type_bool, "true", 0, 0, nullptr, nullptr},
+        {GROUP "/hash_dst_ip", bn_type_bool, "false", 0, 0, nullptr, nullptr},
+        {GROUP "/hash_src_port", bn_type_bool, "false", 0, 0, nullptr, nullptr},
+        {GROUP "/hash_dst_port", bn_type_bool, "false", 0, 0, nullptr, nullptr},
+        {GROUP "/mask_src_ip", bn_type_uint32, "0", 0, NUMBER_MAX, nullptr, nullptr},
+        {GROUP "/mask_dst_ip", bn_type_uint32, "3840", 0, NUMBER_MAX, nullptr, nullptr},
+        {GROUP "/mask_src_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr},
+        {GROUP "/mask_dst_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr},
+        {GROUP "/compatibility", bn_type_str, "ios", 1, 15, "ios|nexus", nullptr},
 
-        {NODE_SYSTEM_FACILITY, bn_type_uint32, nullptr, 0, 184, nullptr, check_facility, false, {}},
-        {NODE_SYSLOG "/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level, false, {}},
-        {MESSAGES "/all/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level, false, {}},
-        {MAIN_MESSAGES "/override/enable", bn_type_bool, "false", 0, 0, nullptr, nullptr, false, {}},
-        {MESSAGES "/override/enable", bn_type_bool, nullptr, 0, 0, nullptr, nullptr, false, {}},
-        {MESSAGES "/single/*/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level, false, {}},
+        {NODE_SYSTEM_FACILITY, bn_type_uint32, "136", 0, 184, nullptr, check_facility},
+        {NODE_SYSLOG "/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level},
+        {MESSAGES "/all/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level},
+        {MAIN_MESSAGES "/override/enable", bn_type_bool, "false", 0, 0, nullptr, nullptr},
+        {MESSAGES "/override/enable", bn_type_bool, nullptr, 0, 0, nullptr, nullptr},
+        {MESSAGES "/single/*/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level},
     };
     for (schema_row &row : made)
         (void)parse_node_name(row.pattern, &row.parts);
@@ -203,6 +207,11 @@ bool parse_node_name(const std::string &text, node_name *out) {
     return count > 0;
 }
 
+node_name parsed_name(const std::string &text) {
+    node_name out;
+    return parse_node_name(text, &out) ? out : node_name{};
+}
+
 bool matches(const node_name &pattern, const node_name &name) {
     return pattern.parts.size() == name.parts.size() &&
            std::equal(pattern.parts.begin(), pattern.parts.end(), name.parts.begin(),
@@ -219,6 +228,14 @@ const schema_row *find_schema_row(const node_name &name) {
 }
 
 // --- Values
+
+std::string shown_text(const std::string &text) {
+    std::string out = text.substr(0, SHOWN_MAX_BYTES);
+    for (char &c : out)
+        if (static_cast<unsigned char>(c) < 0x20 || c == 0x7f)
+            c = '?';
+    return text.size() > out.size() ? out + "..." : out;
+}
 
 bool canonical_text(uint32_t type, const std::string &text, std::string *out_text) {
     if (text.find('\0') != std::string::npos)
@@ -258,12 +275,32 @@ static bool check_instance(const schema_row &row, const std::string &part, std::
     if (is_number(part) && std::to_string(std::stoll(part)) == part && std::stoll(part) >= row.min &&
         std::stoll(part) <= row.max)
         return true;
-    *out_reason = "\"" + part + "\" is no number between " + range_text(row);
+    *out_reason = "\"" + shown_text(part) + "\" is no number between " + range_text(row);
     return false;
+}
+
+// What the configuration file could not give back, and what nobody would see.
+static bool check_part(const std::string &part, std::string *out_reason) {
+    const auto is_control = [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == 0x7f; };
+    const char *fault = nullptr;
+    if (std::any_of(part.begin(), part.end(), is_control))
+        fault = "has control characters";
+    else if (part.front() == ' ' || part.back() == ' ')
+        fault = "begins or ends with a blank";
+    else if (part.back() == '\\')
+        fault = "ends with a backslash";
+    else if (part.size() > PART_MAX_BYTES)
+        fault = "is longer than 255 characters";
+    if (fault)
+        *out_reason = "the part \"" + shown_text(part) + "\" of the name " + fault + "; write it without";
+    return !fault;
 }
 
 bool check_value(const schema_row &row, const node_name &name, const std::string &text, std::string *out_text,
                  std::string *out_reason) {
+    for (const std::string &part : name.parts)
+        if (!check_part(part, out_reason))
+            return false;
     // The numbers of all instances on the way down, for a child may be named before them.
     for (const schema_row &above : rows) {
         const size_t depth = above.parts.parts.size();
@@ -281,7 +318,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
         return false;
     }
     const bool secret = name.parts.back() == "password";
-    const std::string shown = secret ? "the password" : "\"" + text + "\"";
+    const std::string shown = secret ? "the password" : "\"" + shown_text(text) + "\"";
     if (!canonical_text(row.type, from_hexadecimal(row.type, text), out_text)) {
         *out_reason = shown + " is no " + type_name(row.type);
         return false;

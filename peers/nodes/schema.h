@@ -21,6 +21,7 @@ struct node_name {
 };
 // False for a name that is relative, has no parts or an empty one.
 bool parse_node_name(const std::string &text, node_name *out);
+node_name parsed_name(const std::string &text); // no parts for a text that is no name
 
 struct schema_row {
     const char *pattern;
@@ -30,8 +31,11 @@ struct schema_row {
     const char *words;    // of a text, separated by "|"
     // Further checks: the reason why the text is refused, or null.
     const char *(*check)(const std::string &text);
-    bool instance; // the node stands for one of many; its value is its own last part, its children need it
-    node_name parts;
+    // The node is one of many: its value is its own last part, and its children need it.
+    bool instance = false;
+    bool recreates =
+        false; // a running group follows a change of it only when it is deleted and created again
+    node_name parts = {};
 };
 const std::vector<schema_row> &schema();
 // Patterns of the nodes that wccpd answers for.
@@ -39,7 +43,10 @@ const std::vector<const char *> &wccpd_state_nodes();
 const schema_row *find_schema_row(const node_name &name); // null: there is no such node
 bool matches(const node_name &pattern, const node_name &name);
 
-// Brings a value into its one form. False with the reason for a bad one; the reason repeats no password.
+// A text from outside as messages quote it: without control characters, and cut when it is long.
+std::string shown_text(const std::string &text);
+// Checks the parts of the name and brings the value into its one form. False with the reason for a bad one;
+// the reason repeats no password.
 bool check_value(const schema_row &row, const node_name &name, const std::string &text, std::string *out_text,
                  std::string *out_reason);
 // Text of one type into the form that the type's own conversion gives.

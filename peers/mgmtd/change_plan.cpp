@@ -1,0 +1,79 @@
+#include "peers/mgmtd/change_plan.h"
+
+#include <set>
+
+#include "mgmt/node_paths.h"
+
+// The root of the service group that the node belongs to, or the node itself.
+static node_name unit_of(const node_name &name) {
+    static const node_name groups = parsed_name(NODE_GROUP_CONFIG);
+    if (!name.is_under(groups))
+        return name;
+    return groups.below(name.parts[groups.parts.size()]);
+}
+
+static bool is_group(const node_name &name) {
+    static const node_name pattern = parsed_name(NODE_GROUP_CONFIG "/*");
+    return matches(pattern, name);
+}
+
+// A change of a group that exists before and after.
+static bool can_follow(const node_change &change) {
+    const schema_row *row = find_schema_row(change.name);
+    return change.after && row && !row->recreates;
+}
+
+static void append_group(const node_map &nodes, const node_name &root, bool created, change_list *out) {
+    node_list found;
+    collect_nodes(nodes, root, {true, true, false}, &found);
+    for (const auto *node : found) {
+        node_change change{node->first, {}, {}};
+        (created ? change.after : change.before) = node->second;
+        out->push_back(std::move(change));
+    }
+}
+
+std::vector<change_list> plan_for_wccpd(const node_tree &before, const node_tree &after,
+                                        const commit_result &commit) {
+    std::set<node_name> whole; // groups that are deleted, created, or both
+    for (const node_name &name : commit.renewed)
+        if (is_group(name))
+            whole.insert(name);
+    for (const node_change &change : commit.changes)
+        if (const node_name unit = unit_of(change.name); is_group(unit))
+            if (change.name == unit || !can_follow(change))
+                whole.insert(unit);
+    change_list gone, rest, anew;
+    for (const node_name &root : whole) {
+        append_group(before.nodes, root, false, &gone);
+        append_group(after.nodes, root, true, &anew);
+    }
+    for (const node_change &change : commit.changes)
+        if (!whole.contains(unit_of(change.name)))
+            rest.push_back(change);
+    return {std::move(gone), std::move(rest), std::move(anew)};
+}
+
+// At least the bytes that the bindings of a change take: up to five, each with the entry's name.
+static size_t size_of(const node_change &change) {
+    return 1000 + change.name.text().size() + (change.before ? change.before->text.size() : 0) +
+           (change.after ? change.after->text.size() : 0);
+}
+
+std::vector<std::vector<const node_change *>>
+cut_into_events(const std::vector<const node_change *> &changes) {
+    std::vector<std::vector<const node_change *>> out;
+    size_t size = 0;
+    node_name unit;
+    for (const node_change *change : changes) {
+        const node_name next = unit_of(change->name);
+        if (out.empty() || (size >= EVENT_BYTES && next != unit)) {
+            out.emplace_back();
+            size = 0;
+        }
+        unit = next;
+        size += size_of(*change);
+        out.back().push_back(change);
+    }
+    return out;
+}

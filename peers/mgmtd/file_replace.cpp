@@ -1,0 +1,133 @@
+// The new file is written beside the old one under a fixed name, synced, read back and renamed over it. The
+// name is fixed so that what a killed replacement leaves is found again; only one process may replace a file.
+#include "peers/mgmtd/file_replace.h"
+
+#include <cerrno>
+#include <climits>
+#include <cstring>
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+static constexpr size_t FILE_MAX_BYTES = 16u << 20;
+static constexpr int LINKS_MAX = 40; // on the way to a file, as the kernel has it
+
+namespace {
+struct owned_fd {
+    int fd;
+    explicit owned_fd(int opened) : fd(opened) {}
+    owned_fd(const owned_fd &) = delete;
+    owned_fd &operator=(const owned_fd &) = delete;
+    ~owned_fd() {
+        if (fd >= 0)
+            close(fd);
+    }
+};
+
+// The file beside, until it is renamed.
+struct unfinished_file {
+    std::string path;
+    bool renamed = false;
+    explicit unfinished_file(const std::string &target) : path(target + ".unfinished") {
+        unlink(path.c_str());
+    }
+    unfinished_file(const unfinished_file &) = delete;
+    unfinished_file &operator=(const unfinished_file &) = delete;
+    ~unfinished_file() {
+        if (!renamed)
+            unlink(path.c_str());
+    }
+};
+} // namespace
+
+static bool failed(std::string *out_reason) {
+    *out_reason = strerror(errno);
+    return false;
+}
+
+static std::string directory_of(const std::string &path) {
+    const size_t slash = path.rfind('/');
+    return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
+}
+
+// Where the file is, behind all links; the last of them may point to nothing yet.
+static bool follow_links(const std::string &path, std::string *out, std::string *out_reason) {
+    *out = path;
+    for (int i = 0; i < LINKS_MAX; i++) {
+        char bytes[PATH_MAX];
+        const ssize_t length = readlink(out->c_str(), bytes, sizeof bytes);
+        if (length < 0)
+            return errno == EINVAL || errno == ENOENT || failed(out_reason);
+        const std::string target(bytes, static_cast<size_t>(length));
+        *out = target[0] == '/' ? target : directory_of(*out) + "/" + target;
+    }
+    errno = ELOOP;
+    return failed(out_reason);
+}
+
+static bool read_all(int fd, std::string *out) {
+    char bytes[65536];
+    ssize_t got;
+    while ((got = read(fd, bytes, sizeof bytes)) != 0) {
+        if (got < 0 && errno != EINTR)
+            return false;
+        if (got > 0)
+            out->append(bytes, static_cast<size_t>(got));
+        if (out->size() > FILE_MAX_BYTES) {
+            errno = EFBIG;
+            return false;
+        }
+    }
+    return true;
+}
+
+bool read_whole_file(const std::string &path, std::optional<std::string> *out, std::string *out_reason) {
+    out->reset();
+    const owned_fd file(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (file.fd < 0)
+        return errno == ENOENT || failed(out_reason);
+    return read_all(file.fd, &out->emplace()) || failed(out_reason);
+}
+
+static bool write_whole(int fd, const std::string &content) {
+    for (size_t done = 0; done < content.size();) {
+        const ssize_t wrote = write(fd, content.data() + done, content.size() - done);
+        if (wrote < 0 && errno != EINTR)
+            return false;
+        if (wrote > 0)
+            done += static_cast<size_t>(wrote);
+    }
+    return fsync(fd) == 0;
+}
+
+static void sync_directory(const std::string &file) {
+    const owned_fd directory(open(directory_of(file).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (directory.fd >= 0)
+        (void)fsync(directory.fd);
+}
+
+bool replace_file(const std::string &path, const std::string &content, mode_t mode, const accept_file &accept,
+                  std::string *out_reason) {
+    std::string target, written;
+    if (!follow_links(path, &target, out_reason))
+        return false;
+    unfinished_file fresh(target);
+    const owned_fd file(
+        open(fresh.path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR));
+    if (file.fd < 0 || fchmod(file.fd, mode) != 0 || !write_whole(file.fd, content) ||
+        lseek(file.fd, 0, SEEK_SET) != 0 || !read_all(file.fd, &written))
+        return failed(out_reason);
+    if (accept && !accept(written, out_reason))
+        return false;
+    if (rename(fresh.path.c_str(), target.c_str()) != 0)
+        return failed(out_reason);
+    fresh.renamed = true;
+    sync_directory(target);
+    return true;
+}
+
+bool remove_unfinished_file(const std::string &path) {
+    std::string target, reason;
+    return follow_links(path, &target, &reason) && unlink((target + ".unfinished").c_str()) == 0;
+}

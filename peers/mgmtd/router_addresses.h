@@ -1,0 +1,19 @@
+// Router addresses that cannot be one: no router answers there, or wccpd would ignore them.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "peers/mgmtd/node_tree.h"
+
+// An IPv4 address of this machine and the broadcast address of its network, in host order.
+struct local_address {
+    uint32_t address, broadcast; // broadcast 0: the network has none
+};
+std::vector<local_address> find_local_addresses();
+
+// One reason for each such address, which begins with its node and ": ". With `before` only groups whose
+// routers are not the same there are looked at.
+std::vector<std::string> find_bad_routers(const node_tree &tree, const node_tree *before,
+                                          const std::vector<local_address> &local);
