@@ -1,5 +1,5 @@
-// The words of "mgmtctl group", and what becomes of a change of two commits that stops in between. What
-// mgmtd and wccpd make of them is looked at in tests/scenario_mgmtctl_groups.sh.
+// The words of "mgmtctl group", and the commits that they become. What mgmtd and wccpd make of these is the
+// subject of tests/scenario_mgmtctl_groups.sh.
 #include <gtest/gtest.h>
 
 #include <map>
@@ -18,7 +18,7 @@ struct fake {
                                                 {ROOT + "/router/1/ipaddr", "10.0.0.1"},
                                                 {ROOT + "/weight", "100"}}; // its default
     std::vector<std::vector<ctl_change_item>> commits;                      // that were sent
-    std::vector<uint32_t> codes;                                            // of the answers, 1: none comes
+    uint32_t code = 0;                                                      // of the answer, 1: none comes
 
     group_result run(const std::vector<std::string> &words) {
         commits.clear();
@@ -35,11 +35,8 @@ struct fake {
         link.set = [this](const std::vector<ctl_change_item> &items, ctl_reply *out,
                           std::string *out_reason) {
             commits.push_back(items);
-            const bool trial = items.back().binding.name.ends_with("/trial");
-            out->code = trial                            ? uint32_t{LC_NOT_FOUND}
-                        : commits.size() <= codes.size() ? codes[commits.size() - 1]
-                                                         : 0;
-            out->message = trial ? items.back().binding.name + ": there is no such node" : "not like that";
+            out->code = code;
+            out->message = "not like that";
             *out_reason = "mgmtd closed the session";
             return out->code != 1;
         };
@@ -54,7 +51,8 @@ struct fake {
         return out;
     }
 };
-const std::vector<std::string> NEW_ROUTER = {"set", "51", "router", "10.0.0.2", "weight", "7"};
+const std::vector<std::string> NEW_ROUTERS = {"set",    "51",       "router", "10.0.0.1",
+                                              "router", "10.0.0.2", "weight", "7"};
 } // namespace
 
 TEST(Groups, WrongWordsChangeNothingAndAreTold) {
@@ -95,43 +93,28 @@ TEST(Groups, OneCommitWhereARunningGroupFollows) {
     EXPECT_EQ(mgmtd.sent(0), "reset /weight=;");
 }
 
-TEST(Groups, AGroupThatIsCreatedAgainKeepsWhatWasSet) {
+TEST(Groups, AsAWholeItIsOneCommitAsWell) {
     fake mgmtd;
-    const std::string before =
-        "create =51;create /interface=eth0;create /password=a 'b;create /router/1/ipaddr=10.0.0.1;";
-    EXPECT_EQ(mgmtd.run(NEW_ROUTER).done, "recreated");
-    ASSERT_EQ(mgmtd.commits.size(), 3u); // the first can only be refused
-    EXPECT_EQ(mgmtd.sent(1), "remove =;");
-    EXPECT_EQ(mgmtd.sent(2), "create =51;create /interface=eth0;create /password=a 'b;create "
-                             "/router/1/ipaddr=10.0.0.2;create /weight=7;");
-    EXPECT_NE(mgmtd.run({"set", "51", "interface", "none"}).note.find("; without an interface"),
-              std::string::npos);
-    mgmtd.nodes[ROOT + "/policy_grp"] = "5";
-    EXPECT_EQ(mgmtd.run({"set", "51", "policy", "none"}).done, "recreated");
-    EXPECT_EQ(mgmtd.sent(2), before);
+    group_result result = mgmtd.run(NEW_ROUTERS);
+    EXPECT_EQ(result.done, "recreated");
+    EXPECT_EQ(result.note, "wccpd takes a change of router only with the group as a whole");
+    EXPECT_EQ(mgmtd.sent(0), "create /router/2/ipaddr=10.0.0.2;modify /weight=7;");
+    result = mgmtd.run({"set", "51", "router", "none", "interface", "none"});
+    EXPECT_EQ(mgmtd.sent(0), "remove /router/1=;reset /interface=;");
+    EXPECT_NE(result.note.find("router, interface only with the group as a whole; without an interface"),
+              std::string::npos)
+        << result.note;
     EXPECT_EQ(mgmtd.run({"restart", "51"}).done, "recreated");
-    EXPECT_EQ(mgmtd.sent(2), before.substr(0, before.find("create /router")) +
-                                 "create /policy_grp=5;create /router/1/ipaddr=10.0.0.1;");
+    EXPECT_EQ(mgmtd.sent(0), "remove =;create =51;create /interface=eth0;create /password=a 'b;create "
+                             "/router/1/ipaddr=10.0.0.1;");
+    EXPECT_EQ(mgmtd.commits.size(), 1u);
 
-    mgmtd.nodes.erase(ROOT + "/policy_grp");
-    mgmtd.codes = {0, LC_IO_ERROR};
-    group_result result = mgmtd.run(NEW_ROUTER);
-    EXPECT_EQ(result.exit, CTL_REFUSED);
-    EXPECT_EQ(result.commits, 0);
-
-    mgmtd.codes = {0, 0, LC_ASSERTION};
-    result = mgmtd.run(NEW_ROUTER);
-    EXPECT_EQ(result.exit, CTL_REFUSED);
-    EXPECT_EQ(result.done, "restored");
-    EXPECT_EQ(mgmtd.sent(3), before);
-
-    for (const std::vector<uint32_t> &codes :
-         {std::vector<uint32_t>{0, 0, 1}, {0, 0, LC_IO_ERROR, LC_IO_ERROR}}) {
-        mgmtd.codes = codes;
-        result = mgmtd.run(NEW_ROUTER);
-        EXPECT_EQ(result.exit, CTL_PARTLY);
-        EXPECT_NE(result.note.find("mgmtctl group add 51 router 10.0.0.1 interface eth0 password 'a '\\''b'"),
-                  std::string::npos)
-            << result.note;
+    for (const auto &words : {NEW_ROUTERS, {"restart", "51"}}) {
+        mgmtd.code = LC_ASSERTION;
+        result = mgmtd.run(words);
+        EXPECT_EQ(result.exit, CTL_REFUSED);
+        EXPECT_EQ(result.done, "");
+        mgmtd.code = 1;
+        EXPECT_EQ(mgmtd.run(words).exit, CTL_UNREACHABLE);
     }
 }

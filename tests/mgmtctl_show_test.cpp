@@ -179,7 +179,8 @@ TEST(Show, TellsTheWholeOfAGroup) {
 
     const std::string screen = joined(draw_screen(shown, {80, 23, false, false, ""}));
     for (const char *text :
-         {"wccpd Ready (1.0.0)   1 group: 1 active   1 alarm\n! group 51: a router is not connected as it should be, since 2026/11/25 00:10:11\n",
+         {"wccpd Ready (1.0.0)   1 group: 1 active   1 alarm\n! group 51: a router is not connected as it "
+          "should be, since 2026/11/25 00:10:11\n",
           "51  ACTIVE, designated !  up 1:02:03  10.0.0.101 on eth0  tcp  weight 25  md5\n",
           "  router 10.0.0.1        two-way   0:01:00  fwd gre  assign -     return l2",
           "  router 10.0.0.3        nothing heard\n",

@@ -65,7 +65,7 @@ TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
 
 // --- Changes
 
-TEST(Changes, WhatARunningGroupDoesNotFollowIsTold) {
+TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
     const groups_before before = {{G51, GROUPS + "/52"},
                                   {{G51 + "/priority", "uint32", "200"},
                                    {G51 + "/policy_grp", "uint32", "3"},
@@ -86,18 +86,16 @@ TEST(Changes, WhatARunningGroupDoesNotFollowIsTold) {
         {{set(G51 + "/priority", "200")}, {}, {}},
         {{set(G51 + "/priority", "9"), set(G51 + "/router/2/ipaddr", "10.0.0.2")},
          {},
-         {"group 51: a running group follows a change of priority, router only when"}},
-        {{remove(G51 + "/priority")}, {}, {"a change of priority only when"}},
+         {"group 51: wccpd takes a change of priority, router only with"}},
+        {{remove(G51 + "/priority")}, {}, {"a change of priority only with"}},
         {{remove(G51 + "/interface")}, {}, {"a change of interface"}}, // it wasn't set, as far as is known
         {{remove(G51 + "/policy_grp"), remove(G51 + "/router/1")},
          {},
-         {"without policy_grp, router/1 wccpd lets"}},
+         {"a change of policy_grp, router/1 only with"}},
         {{remove(G51 + "/router/1"), remove(G51)}, {}, {}},
         {{set(GROUPS + "/53/weight", "7"), set(GROUPS + "/53/priority", "1")}, {GROUPS + "/53"}, {}},
         {{set(GROUPS + "/53/weight", "7"), remove(GROUPS + "/52")}, {GROUPS + "/53"}, {}},
-        {{set(GROUPS + "/53/weight", "7"), set(G51 + "/weight", "7")},
-         {GROUPS + "/53"},
-         {"creates or deletes a group in that alone"}},
+        {{set(GROUPS + "/53/weight", "7"), set(G51 + "/weight", "7")}, {GROUPS + "/53"}, {}},
     };
     for (const auto &one : cases) {
         const change_notes said = notes_of(one.items, before);

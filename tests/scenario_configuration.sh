@@ -74,25 +74,25 @@ case_password() {
     finish a1 -- 'mismatch security opt'
 }
 
-# What a running group doesn't follow: it is said, and the group goes on; an entry taken out takes the group with it.
-case_not_followed() {
+# What a running group doesn't follow, and a node without a default that is taken out: it is deleted and created again,
+# within one commit that changes another group in place and creates a third.
+case_as_a_whole() {
     lab_router r1 10.0.0.1
     lab_router r2 10.0.0.2
-    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1 10.0.0.2)"
+    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1 10.0.0.2 policy_grp=5)" "$(lab_group 52 10.0.0.1)"
     role a1 30 51 ACTIVE
-    configure a1 "$(lab_group 51 10.0.0.1 10.0.0.2 priority=9 protocol=udp)"
-    says a1 5 'WCCP update: Unknown binding /qv/wccpd/wccp/srv_grp/config/51/priority'
-    group_is a1 1 51 '.oper == "ACTIVE, DESIGNATED"'
-    router_is r1 1 51 '$g.service.priority == 200 and $g.service.protocol == 6'
-    configure a1 "$(lab_group 51 10.0.0.1 priority=9 protocol=udp)"
-    router_is r1 5 51 '$g.appliances == []'
+    lab_mark a1
+    configure a1 "$(lab_group 51 10.0.0.1 priority=9 protocol=udp weight=9)" "$(lab_group 52 10.0.0.1 weight=8)" "$(lab_group 53 10.0.0.1)"
     says a1 5 'WCCP update: Deleted Group 51'
-    # Deleted and added again, it follows.
-    configure a1
-    configure a1 "$(lab_group 51 10.0.0.1 priority=9 protocol=udp)"
     says a1 5 'Created WCCP group 51'
-    router_is r1 30 51 '$g.service.priority == 9 and $g.service.protocol == 17 and ($g.appliances | length) == 1'
-    finish a1 -- 'WCCP update: (Unknown binding|Failed to delete Group 51)' 'Group 51 does not exists' 'Error code'
+    says a1 5 'Created WCCP group 53'
+    router_is r1 30 51 '$g.service.priority == 9 and $g.service.protocol == 17 and $g.appliances[0].weight == 9'
+    router_is r1 15 52 '$g.appliances[0].weight == 8'
+    router_is r1 15 53 '($g.appliances | length) == 1'
+    router_is r2 1 51 '$g.appliances == []'
+    ! lab_log a1 | grep -q 'Deleted Group 52' || die "a group that follows is deleted"
+    role a1 30 51 ACTIVE
+    finish a1
 }
 
 # Forty groups come and go with one commit each.
@@ -110,7 +110,7 @@ case_many() {
     finish a1
 }
 
-# A policy group is as its groups are: active with all of them. The groups of one that is deleted go to number 300.
+# A policy group is as its groups are: active with all of them. One that has groups can't be deleted before they leave it.
 case_policy() {
     roles() { lab_wait_line "$1" "$2" "$LAB/a1-tunneld.out" || die "role"; }
     local policy='[/qv/wccpd/wccp/policy_grp/config/5]'
@@ -124,13 +124,15 @@ case_policy() {
     lab_ctl r2 resume >/dev/null
     role a1 40 52 ACTIVE
     roles 5 '5.*ACTIVE'
-    configure a1 "$(lab_group 51 10.0.0.1 policy_grp=5)" "$(lab_group 52 10.0.0.2 policy_grp=5)"
+    ! lab_configure a1 "$(lab_group 51 10.0.0.1 policy_grp=5)" "$(lab_group 52 10.0.0.2 policy_grp=6)" 2>/dev/null ||
+        die "a policy group in use is deleted"
+    configure a1 "$(lab_group 51 10.0.0.1 policy_grp=6)" "$(lab_group 52 10.0.0.2 policy_grp=6)"
     says a1 5 'WCCP update: Deleted policy Group 5'
-    roles 5 '300.*ACTIVE'
+    roles 5 '6.*ACTIVE'
     roles 5 '5.*UNKNOWN'
     lab_ctl r2 stop >/dev/null
     role a1 40 52 BACKUP
-    roles 5 '300.*BACKUP'
+    roles 5 '6.*BACKUP'
     finish a1
 }
 

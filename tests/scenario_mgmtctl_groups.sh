@@ -1,6 +1,6 @@
 #!/bin/bash
-# Groups in an operator's words, over the whole appliance: added, shared out, changed in place and as a whole, put back
-# when the change is refused, deleted; policy groups; and the picture of it all, once and live, with mgmtd, wccpd and a
+# Groups in an operator's words, over the whole appliance: added, shared out, changed in place and as a whole, deleted;
+# policy groups; and the picture of it all, once and live, with mgmtd, wccpd and a
 # router that go and come.
 #   scenario_mgmtctl_groups.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
@@ -66,13 +66,14 @@ expect 0 '.done == "unchanged" and .commits == 0' group set 51 weight 7 router 1
 expect 0 '.done == "changed"' group set 51 weight default hash_dst_ip true
 ! lab_log a1 | grep -q 'Deleted Group' || fail "a change in place deletes the group"
 
-# Another router takes the group as a whole; a change that is refused does not cost it.
+# Another router takes the group as a whole, in one commit; a change that is refused does not cost it.
 expect 1 '.done == "nothing" and .code == 14008' group set 51 router 10.0.0.1 router 10.0.0.999
-! lab_log a1 | grep -q 'Deleted Group' || fail "a mistyped router deletes the group"
-expect 1 '.done == "restored" and .running and (.error | test("four masks"))' group set 51 router 10.0.0.2 mask_src_ip 0xffff
-[ "$(lab_log a1 | grep -c 'Created WCCP group 51')" = 1 ] || fail "the group is not put back"
-expect 0 '.done == "recreated" and .commits == 2 and .running and (.note | test("router"))' \
+expect 1 '.done == "nothing" and .code == 14002 and (.error | test("an address of this appliance"))' group set 51 router 10.0.0.101
+expect 1 '.done == "nothing" and (.error | test("four masks"))' group set 51 router 10.0.0.2 mask_src_ip 0xffff
+! lab_log a1 | grep -q 'Deleted Group' || fail "a change that is refused deletes the group"
+expect 0 '.done == "recreated" and .commits == 1 and .running and (.note | test("router"))' \
     group set 51 router 10.0.0.1 router 10.0.0.2
+[ "$(lab_log a1 | grep -c 'Created WCCP group 51')" = 1 ] || fail "the group is not created again"
 grep -A 20 'config/51' "$config" | sort >"$LAB/set"
 printf '%s\n' 'assign_method = hash' 'hash_dst_ip = true' 'interface = eth0' 'password = secret' 'priority = 10' \
     'router/1/ipaddr = 10.0.0.1' 'router/2/ipaddr = 10.0.0.2' '[/qv/wccpd/wccp/srv_grp/config/51]' | sort |
@@ -128,11 +129,13 @@ grep -aq $'^\033\\[?1049h' "$LAB/a1-terminal.out" && tail -c 40 "$LAB/a1-termina
 expect 0 '.done == "added"' policy add 5 name web
 expect 0 '.done == "changed" and .state != null' group set 51 policy 5
 expect 0 '.groups[0].policy == 5' show
-expect 0 '.done == "deleted" and (.note | test(" 51"))' policy delete 5
-expect 4 '.code == 14004' policy delete 5
-expect 0 '.notes[0] | test("group restart 51")' set $GROUP/51/priority 20
-expect 0 '.done == "recreated" and .commits == 2 and .running' group restart 51
+expect 1 '.code == 14002 and (.error | test("51/policy_grp: policy group 5 is in use"))' policy delete 5
+expect 0 '.notes[0] | test("priority only with")' set $GROUP/51/priority 20
+lab_wait_log 5 a1 'WCCP config: set priority to 20' || fail "the group does not follow its priority"
+expect 0 '.done == "recreated" and .commits == 1 and .running' group restart 51
 expect 0 '.done == "recreated" and .running' group set 51 policy none
+expect 0 '.done == "deleted"' policy delete 5
+expect 4 '.code == 14004' policy delete 5
 expect 0 '.done == "deleted" and (.running | not)' group delete 51
 expect 0 '.groups_total == 0 and .alarms_total == 0' show
 lab_end a1 a2 || exit 1

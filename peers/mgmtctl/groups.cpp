@@ -1,13 +1,9 @@
 // Groups and policy groups are changed in the words of an operator, each command in one commit.
 //
-// What wccpd follows only with the group as a whole (its routers above all) takes two commits: the group is
-// deleted and created again with everything else that was set. Before that, mgmtd is asked to try the whole
-// change in a commit that cannot succeed, because its last node exists nowhere: a mistyped address is
-// reported while the group still runs. When the second commit is refused all the same, the old group is
-// created again; when nothing more can be done, the command that would bring it back is printed.
-//
-// A value that equals the default of its node is left out of the group that is created again: the
-// configuration file holds what was set and no defaults.
+// What a running group follows only when it is deleted and created again is mgmtd's business: it tells wccpd
+// so, within the one commit. "restart" asks for that by deleting and creating the group in its commit, with
+// what was set. A value that equals the default of its node is left out then: the configuration file holds no
+// defaults.
 //
 // After a change, wccpd's list of groups is read until it agrees, for some seconds at most. It is the list
 // and not the group, because a query for a group that wccpd doesn't have is an error line in its log.
@@ -23,7 +19,6 @@
 #include "peers/mgmtctl/group_words.h"
 #include "runtime/common.h"
 
-static const char *const TRIAL_END = "/mgmtctl/this/is/only/a/trial";
 static group_result failed(group_result result, int exit, const std::string &error, uint32_t code = 0) {
     result.exit = exit;
     result.error = error;
@@ -106,17 +101,6 @@ static std::vector<ctl_change_item> creation(const std::string &root, const grou
     return items;
 }
 
-// The command that would create it.
-static std::string as_command(long number, const group_nodes &nodes) {
-    std::string text = "mgmtctl group add " + std::to_string(number);
-    for (const std::string &router : group_routers(nodes))
-        text += " router " + router;
-    for (const auto &[name, value] : nodes)
-        if (const group_word *word = find_group_word(name); word && std::string(word->node) != "router")
-            text += std::string(" ") + word->word + " " + shell_quoted(value);
-    return text;
-}
-
 // --- Changes
 
 static bool commit(const group_link &link, const std::vector<ctl_change_item> &items, group_result *inout) {
@@ -132,42 +116,6 @@ static bool commit(const group_link &link, const std::vector<ctl_change_item> &i
     }
     inout->commits++;
     return true;
-}
-
-// Whether mgmtd would take these, as far as it looks at one node after the other.
-static bool try_out(const group_link &link, std::vector<ctl_change_item> items, group_result *inout) {
-    items.push_back({ctl_change::create, {TRIAL_END, "", "0"}});
-    group_result trial = *inout;
-    if (commit(link, items, &trial) || (trial.exit == CTL_REFUSED && trial.error.starts_with(TRIAL_END)))
-        return true;
-    *inout = trial;
-    return false;
-}
-
-static void recreate(const group_link &link, const std::string &root, const group_nodes &before,
-                     const group_nodes &after, group_result *inout) {
-    const ctl_change_item away = {ctl_change::remove, {root, "", ""}};
-    std::vector<ctl_change_item> all = {away};
-    const std::vector<ctl_change_item> anew = creation(root, after);
-    all.insert(all.end(), anew.begin(), anew.end());
-    if (!try_out(link, all, inout) || !commit(link, {away}, inout))
-        return;
-    if (commit(link, anew, inout)) {
-        inout->done = "recreated";
-        return;
-    }
-    const group_result refused = *inout;
-    inout->exit = CTL_OK;
-    if (refused.exit == CTL_REFUSED && commit(link, creation(root, before), inout)) {
-        inout->done = "restored";
-        *inout = failed(*inout, CTL_REFUSED, refused.error, refused.code);
-        inout->note = "it was put back as it was, after a moment without";
-        return;
-    }
-    inout->done = "deleted";
-    *inout = failed(*inout, CTL_PARTLY, refused.error, refused.code);
-    inout->note = "it is deleted and could not be created again; this brings it back: " +
-                  as_command(inout->number, before);
 }
 
 // Looks at what wccpd has, until it has the group or hasn't it any more.
@@ -246,16 +194,32 @@ static bool read_standing(const group_link &link, const std::string &root, group
     return read_group(link, root, out, inout);
 }
 
-// For a group that doesn't run as it stands in the configuration, since it was changed node by node.
 static void group_restart(const group_link &link, const std::string &root, group_result *inout) {
     group_nodes nodes;
     if (!read_standing(link, root, &nodes, inout))
         return;
-    recreate(link, root, nodes, nodes, inout);
-    if (inout->done == "recreated")
-        inout->note = what_it_lacks(nodes);
-    if (inout->done != "deleted" && !inout->done.empty())
-        settle(link, true, inout);
+    std::vector<ctl_change_item> items = creation(root, nodes);
+    items.insert(items.begin(), {ctl_change::remove, {root, "", ""}});
+    if (!commit(link, items, inout))
+        return;
+    inout->done = "recreated";
+    inout->note = what_it_lacks(nodes);
+    settle(link, true, inout);
+}
+
+// The new list takes over the entries of the old one, from the first.
+static std::vector<ctl_change_item> router_changes(const std::string &root,
+                                                   const std::vector<std::string> &before,
+                                                   const std::vector<std::string> &after) {
+    std::vector<ctl_change_item> items;
+    for (size_t i = 0; i < std::max(before.size(), after.size()); i++) {
+        const std::string entry = root + "/router/" + std::to_string(i + 1);
+        if (i >= after.size())
+            items.push_back({ctl_change::remove, {entry, "", ""}});
+        else if (i >= before.size() || before[i] != after[i])
+            items.push_back({ctl_change::create, {entry + "/ipaddr", "", after[i]}});
+    }
+    return items;
 }
 
 static void group_set(const group_link &link, const std::string &root, const group_wish &wish,
@@ -264,11 +228,12 @@ static void group_set(const group_link &link, const std::string &root, const gro
     if (!read_standing(link, root, &before, inout))
         return;
     group_nodes after = before;
-    std::vector<ctl_change_item> in_place;
+    std::vector<ctl_change_item> items;
     std::string as_whole;
-    if (wish.routers && *wish.routers != group_routers(before)) {
+    if (wish.routers) {
+        items = router_changes(root, group_routers(before), *wish.routers);
         put_routers(*wish.routers, &after);
-        as_whole = "router";
+        as_whole = items.empty() ? "" : "router";
     }
     for (const auto &[node, value] : wish.values) {
         const group_word *word = find_group_word(node);
@@ -283,24 +248,24 @@ static void group_set(const group_link &link, const std::string &root, const gro
             after[node] = *value;
         else
             after.erase(node);
-        in_place.push_back({value ? ctl_change::modify : ctl_change::reset,
-                            {std::string(root).append("/").append(node), "", value.value_or("")}});
+        items.push_back({value ? ctl_change::modify : ctl_change::reset,
+                         {std::string(root).append("/").append(node), "", value.value_or("")}});
         if (word->whole || (!value && !fallback))
             as_whole += std::string(as_whole.empty() ? "" : ", ") + word->word;
     }
-    if (!as_whole.empty()) {
-        recreate(link, root, before, after, inout);
-        const std::string lack = what_it_lacks(after);
-        if (inout->done == "recreated")
-            inout->note = "wccpd takes a change of " + as_whole + " only with the group as a whole" +
-                          (lack.empty() ? "" : "; " + lack);
-    } else if (in_place.empty()) {
+    if (items.empty()) {
         inout->done = "unchanged";
-    } else if (commit(link, in_place, inout)) {
+    } else if (!commit(link, items, inout)) {
+        return;
+    } else if (as_whole.empty()) {
         inout->done = "changed";
+    } else {
+        const std::string lack = what_it_lacks(after);
+        inout->done = "recreated";
+        inout->note = "wccpd takes a change of " + as_whole + " only with the group as a whole" +
+                      (lack.empty() ? "" : "; " + lack);
     }
-    if (inout->done != "deleted" && !inout->done.empty())
-        settle(link, true, inout);
+    settle(link, true, inout);
 }
 
 static void remove_root(const group_link &link, const std::string &root, group_result *inout) {
@@ -346,19 +311,6 @@ group_result group_command(const group_link &link, const std::vector<std::string
     return result;
 }
 
-// The service groups that name a policy group.
-static std::string members_of(const group_link &link, long number) {
-    ctl_reply reply;
-    std::string reason, out;
-    if (!link.query(ctl_walk::subtree, NODE_GROUP_CONFIG, &reply, &reason))
-        return "";
-    const size_t above = std::string(NODE_GROUP_CONFIG).size() + 1;
-    for (const ctl_binding &binding : reply.bindings)
-        if (binding.name.ends_with("/policy_grp") && binding.value == std::to_string(number))
-            out += " " + binding.name.substr(above, binding.name.find('/', above) - above);
-    return out;
-}
-
 group_result policy_command(const group_link &link, const std::vector<std::string> &words) {
     static const char *const USAGE = "policy add N [name NAME], policy delete N";
     group_result result;
@@ -375,11 +327,6 @@ group_result policy_command(const group_link &link, const std::vector<std::strin
     const std::string root = root_of(NODE_POLICY_CONFIG, result.number);
     if (verb == "delete") {
         remove_root(link, root, &result);
-        if (const std::string members = members_of(link, result.number);
-            result.exit == CTL_OK && !members.empty())
-            result.note = "service groups that still name it:" + members +
-                          "; wccpd keeps them in policy "
-                          "group 300";
         return result;
     }
     bool there = false;

@@ -21,7 +21,7 @@ struct group_result {
     int exit = CTL_OK;
     std::string kind;  // "group" or "policy"
     long number = -1;  // -1: none was understood
-    std::string done;  // "added", "changed", "recreated", "deleted", "unchanged", "restored"; empty: nothing
+    std::string done;  // "added", "changed", "recreated", "deleted", "unchanged"; empty: nothing
     int commits = 0;   // that were made
     uint32_t code = 0; // of mgmtd's refusal
     std::string error;

@@ -273,14 +273,13 @@ static std::string joined(const std::set<std::string> &words) {
 
 change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_before &before) {
     change_notes out;
-    std::set<std::string> touched, ended;                               // roots
-    std::map<std::string, std::set<std::string>> not_followed, dropped; // words by root
+    std::set<std::string> ended;                        // roots
+    std::map<std::string, std::set<std::string>> whole; // words by root
     for (const ctl_change_item &item : items) {
         const std::string &name = item.binding.name;
         const std::string root = group_of(name);
         if (root.empty())
             continue;
-        touched.insert(root);
         const bool removed = item.change == ctl_change::remove || item.change == ctl_change::reset;
         const bool stood = before.roots.contains(root);
         const ctl_binding *old = find_binding(before.bindings, name);
@@ -293,26 +292,14 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
             continue;
         const schema_row *row = find_schema_row(named(name));
         if (removed && old && row && !row->fallback)
-            dropped[root].insert(name.substr(root.size() + 1));
+            whole[root].insert(name.substr(root.size() + 1));
         else if (const std::string word = whole_word(name, root);
                  !word.empty() && (!old || removed || old->value != item.binding.value))
-            not_followed[root].insert(word);
+            whole[root].insert(word);
     }
-    for (const auto &[root, words] : dropped)
+    for (const auto &[root, words] : whole)
         if (!ended.contains(root))
-            out.notes.push_back("group " + number_of(root) + ": without " + joined(words) +
-                                " wccpd lets a running group go, until \"mgmtctl group restart " +
-                                number_of(root) + "\"");
-    for (const auto &[root, words] : not_followed)
-        if (!ended.contains(root) && !dropped.contains(root))
-            out.notes.push_back("group " + number_of(root) + ": a running group follows a change of " +
-                                joined(words) +
-                                " only when it is deleted and created again: \"mgmtctl group restart " +
-                                number_of(root) + "\"");
-    if (touched.size() > 1 && (!out.created.empty() || !ended.empty()) &&
-        touched.size() > out.created.size() + ended.size())
-        out.notes.push_back(
-            "wccpd follows a commit that creates or deletes a group in that alone: the changes of "
-            "other groups are followed only when these are deleted and created again");
+            out.notes.push_back("group " + number_of(root) + ": wccpd takes a change of " + joined(words) +
+                                " only with the group as a whole, which was deleted and created again");
     return out;
 }

@@ -239,9 +239,8 @@ bool tree_check_change(const node_tree &before, const node_tree &after, std::str
         const node_name policy = policy_groups.below(value.text);
         if (!before.nodes.contains(policy) || after.nodes.contains(policy))
             continue;
-        const std::string group = name.parts[name.parts.size() - 2];
-        *out_reason = policy.text() + ": service group " + group +
-                      " is in it; delete or change the policy_grp of the service group first, or with it";
+        *out_reason = name.text() + ": policy group " + value.text +
+                      " is in use here and can't be deleted; change or delete this node first, or with it";
         return false;
     }
     return true;
