@@ -117,9 +117,9 @@ expect 0 "created ${G%51}52" set "${G%51}52/weight=1"
 expect 0 'jq:.changed == ["'"${G%51}52"'"] and .exit == 0' --json delete "${G%51}52"
 expect 4 '' delete "${G%51}52"
 expect 0 '' set $G/priority 100
-complains '*note: group 51: a running group follows a change of priority only*'
+complains '*note: group 51: wccpd takes a change of priority only with the group as a whole*'
 expect 0 '' delete $G/router/1
-complains '*note: group 51: without router/1 wccpd lets a running group go*'
+complains '*note: group 51: wccpd takes a change of router/1 only with the group as a whole*'
 expect 0 '' delete $G/mask_dst_ip
 expect 0 3840 get $G/mask_dst_ip
 

@@ -13,7 +13,7 @@ enum ctl_exit : int {
     CTL_USAGE = 2,       // the command line
     CTL_UNREACHABLE = 3, // no mgmtd, no answer, or the session was lost
     CTL_NOT_FOUND = 4,   // no such node or group
-    CTL_PARTLY = 5,      // a change of several commits stopped in between; the rest is reported
+    CTL_PARTLY = 5,      // no longer given: every command is one commit
     CTL_STANDING = 6,    // alarms --check: an alarm stands
     CTL_OUTPUT = 7,      // standard output took not all of it
 };
