@@ -13,6 +13,7 @@
 #include <unistd.h>
 
 #include "mgmt/bnode_proto.h"
+#include "mgmt/gcl.h"
 #include "mgmt/mdc_main.h"
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
@@ -450,6 +451,15 @@ TEST_F(Mgmtd, TheFileHoldsEachCommitBeforeItIsTold) {
     reload("[" + GROUP + "]\nweight = 7\n");
     EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "8"}}), 0u) << message();
 
+    // What would not be read the same is not written, whatever let it in.
+    const std::string held = content();
+    const node_name hidden = named("/logging/syslog/process/a /log_level");
+    daemon.tree.set[hidden] = "debug";
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "9"}}), static_cast<uint32_t>(LC_IO_ERROR));
+    EXPECT_NE(message().find("would not be read the same"), std::string::npos) << message();
+    EXPECT_EQ(content(), held);
+    daemon.tree.set.erase(hidden);
+
     const auto kept = daemon.tree.set;
     daemon.file.path = std::string(file) + "/no/such/directory";
     EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "9"}}), static_cast<uint32_t>(LC_IO_ERROR));
@@ -505,6 +515,10 @@ TEST_F(Mgmtd, AnInterestHearsWhatItsPatternsName) {
     EXPECT_EQ(changes(), strings{"/qv/tunneld/system/config/mode=router>bridge"});
     action(3, "/mgmtd/events/actions/interest/add", {{"match/1/pattern", {bn_type_str, "/a"}}});
     EXPECT_EQ(code(), static_cast<uint32_t>(LC_BAD_ARGUMENT));
+    const owned_request large(make_event("/a", {{"a", {bn_type_str, std::string(GCL_FRAME_MAX, 'x')}}}));
+    clear();
+    EXPECT_FALSE(server_send_request(&daemon, 1, large.pointer));
+    EXPECT_TRUE(sent.empty()) << "wccpd would end its session";
     action(3, "/mgmtd/reboot", {});
     EXPECT_EQ(message(), "No such action: /mgmtd/reboot");
 }

@@ -33,8 +33,7 @@ static void append_group(const node_map &nodes, const node_name &root, bool crea
     }
 }
 
-std::vector<change_list> plan_for_wccpd(const node_tree &before, const node_tree &after,
-                                        const commit_result &commit) {
+wccpd_plan plan_for_wccpd(const node_tree &before, const node_tree &after, const commit_result &commit) {
     std::set<node_name> whole; // groups that are deleted, created, or both
     for (const node_name &name : commit.renewed)
         if (is_group(name))
@@ -43,15 +42,17 @@ std::vector<change_list> plan_for_wccpd(const node_tree &before, const node_tree
         if (const node_name unit = unit_of(change.name); is_group(unit))
             if (change.name == unit || !can_follow(change))
                 whole.insert(unit);
-    change_list gone, rest, anew;
+    wccpd_plan plan;
     for (const node_name &root : whole) {
-        append_group(before.nodes, root, false, &gone);
-        append_group(after.nodes, root, true, &anew);
+        append_group(before.nodes, root, false, &plan.events[0]);
+        append_group(after.nodes, root, true, &plan.events[2]);
+        if (before.nodes.contains(root) && after.nodes.contains(root))
+            plan.recreated.push_back(root);
     }
     for (const node_change &change : commit.changes)
         if (!whole.contains(unit_of(change.name)))
-            rest.push_back(change);
-    return {std::move(gone), std::move(rest), std::move(anew)};
+            plan.events[1].push_back(change);
+    return plan;
 }
 
 // At least the bytes that the bindings of a change take: up to five, each with the entry's name.

@@ -11,8 +11,11 @@ using change_list = std::vector<node_change>;
 // interface, priority or protocol of a running group, nor do without a node that has no default. A commit
 // therefore reaches it in up to three events: groups deleted, everything else, groups created. A group that
 // could not follow is in the first and in the last, whole.
-std::vector<change_list> plan_for_wccpd(const node_tree &before, const node_tree &after,
-                                        const commit_result &commit);
+struct wccpd_plan {
+    change_list events[3]; // in the order to send them; an empty one is left out
+    std::vector<node_name> recreated;
+};
+wccpd_plan plan_for_wccpd(const node_tree &before, const node_tree &after, const commit_result &commit);
 
 // One event holds so many bytes at most, and the rest of a group: groups are not cut.
 constexpr size_t EVENT_BYTES = 1u << 20;

@@ -265,8 +265,9 @@ static bool reads_the_same(const std::string &written, const node_tree &tree, st
     config_text again;
     if (config_parse(written, "what was written", &again) && again.tree.set == tree.set)
         return true;
-    *out_reason =
-        "what was written would not be read the same: " + again.errors.substr(0, again.errors.find('\n'));
+    *out_reason = "what was written would not be read the same";
+    if (!again.errors.empty())
+        *out_reason += ": " + again.errors.substr(0, again.errors.find('\n'));
     return false;
 }
 

@@ -2,27 +2,18 @@
 //
 // Everything runs on one thread, from the loop of the transport. A message is read, acted on and answered
 // before the next one; only a query for the state of another daemon waits, as a record in `pending`, and
-// nothing waits for it. What is sent goes to the transport's queue. Queries are in queries.cpp, alarms and
-// state events in reports.cpp.
+// nothing waits for it. What is sent goes to the transport's queue. Queries are in queries.cpp, commits in
+// commits.cpp, alarms and state events in reports.cpp.
 //
 // Whoever has reached the socket is trusted: the transport lets only root and its own user in. What comes is
 // bounded by the frame that brought it all the same.
 #include "peers/mgmtd/server.h"
 
 #include <algorithm>
-#include <cerrno>
-#include <cstring>
-#include <filesystem>
-#include <sstream>
-#include <utility>
-
-#include <unistd.h>
 
 #include "mgmt/bnode_proto.h"
 #include "mgmt/gcl.h"
 #include "mgmt/node_paths.h"
-#include "peers/mgmtd/change_plan.h"
-#include "peers/mgmtd/file_replace.h"
 
 static constexpr uint16_t SERVICE = 2;
 
@@ -176,164 +167,6 @@ static void take_action(server *self, uint32_t peer_id, const bn_request_msg *ms
 }
 
 // --- Changes of the configuration
-
-static bool is_wanted(const peer &who, const node_name &name) {
-    for (const interest &wish : who.interests) {
-        if (wish.event != EVENT_CONFIG_CHANGE)
-            continue;
-        if (wish.patterns.empty() ||
-            std::any_of(wish.patterns.begin(), wish.patterns.end(),
-                        [&](const std::string &pattern) { return interest_matches(pattern, name); }))
-            return true;
-    }
-    return false;
-}
-
-static void tell_change(server *self, const node_tree &before, const commit_result &commit) {
-    const std::vector<change_list> planned = plan_for_wccpd(before, self->tree, commit);
-    const std::vector<change_list> plain = {commit.changes};
-    std::vector<std::pair<uint32_t, std::vector<const node_change *>>> events;
-    for (const auto &[id, who] : self->peers)
-        for (const change_list &changes : who.name.starts_with("wccpd-") ? planned : plain) {
-            std::vector<const node_change *> wanted;
-            for (const node_change &change : changes)
-                if (is_wanted(who, change.name))
-                    wanted.push_back(&change);
-            for (auto &event : cut_into_events(wanted))
-                events.emplace_back(id, std::move(event));
-        }
-    for (const auto &[id, event] : events) {
-        const owned_request msg(make_change_event(event));
-        (void)server_send_request(self, id, msg.pointer);
-    }
-}
-
-// Programs read the facility before they have a session. Other lines of the file are somebody else's.
-static void write_facility(const server *self) {
-    if (self->facility_file.empty())
-        return;
-    static const node_name facility = parsed_name(NODE_SYSTEM_FACILITY);
-    std::optional<std::string> before;
-    std::string reason, content = "system " + self->tree.nodes.at(facility).text + "\n";
-    bool good = read_whole_file(self->facility_file, &before, &reason);
-    std::istringstream lines(before.value_or(""));
-    for (std::string line; std::getline(lines, line);)
-        if (!line.starts_with("system "))
-            content += line + "\n";
-    if (good && content != before) {
-        std::error_code ignored; // the write says what is wrong
-        std::filesystem::create_directories(std::filesystem::path(self->facility_file).parent_path(),
-                                            ignored);
-        good = replace_file(self->facility_file, content, 0644, nullptr, &reason);
-    }
-    if (!good)
-        self->say("the log facility is not written for programs that start: " + self->facility_file + ": " +
-                  reason);
-}
-
-static void take_over(server *self, node_tree next, const commit_result &commit) {
-    const node_tree before = std::exchange(self->tree, std::move(next));
-    write_facility(self);
-    tell_change(self, before, commit);
-}
-
-// What mgmtd refuses beyond what a tree by itself shows.
-static bool may_commit(const server *self, const node_tree &next, std::string *out_reason) {
-    const std::vector<std::string> bad = find_bad_routers(next, &self->tree, self->local_addresses());
-    if (!bad.empty())
-        *out_reason = bad.front();
-    return bad.empty() && tree_check_change(self->tree, next, out_reason);
-}
-
-static commit_result prepare_commit(server *self, const std::vector<set_step> &steps, node_tree *out_next) {
-    commit_result result = tree_prepare(self->tree, steps, out_next);
-    std::string reason;
-    if (result.code == 0 && !may_commit(self, *out_next, &reason))
-        return {LC_ASSERTION, reason, {}, {}};
-    if (result.code == 0 && out_next->set == self->tree.set && result.renewed.empty())
-        out_next->revision = self->tree.revision;
-    else if (result.code == 0 && !self->file.path.empty() &&
-             !config_save(&self->file, *out_next, self->comments, &reason))
-        return {LC_IO_ERROR, "The configuration could not be saved: " + reason, {}, {}};
-    return result;
-}
-
-commit_result server_commit(server *self, const std::vector<set_step> &steps, const std::string &who) {
-    node_tree next;
-    commit_result result = prepare_commit(self, steps, &next);
-    if (result.code != 0) {
-        self->say("commit of " + who + " refused: " + result.message);
-        return result;
-    }
-    self->say("commit " + std::to_string(next.revision) + " of " + who + ": " +
-              std::to_string(result.changes.size()) + " nodes changed");
-    take_over(self, std::move(next), result);
-    return result;
-}
-
-static void append_lines(const server *self, const config_text &text, const std::vector<std::string> &reasons,
-                         std::string *out) {
-    for (const std::string &reason : reasons)
-        *out += config_complaint(self->file.path, text.lines, reason);
-}
-
-bool server_load(server *self, std::string *out_errors, std::string *out_warnings) {
-    config_text text;
-    const bool good = config_load(&self->file, &text);
-    *out_errors = text.errors;
-    if (good)
-        append_lines(self, text, find_bad_routers(text.tree, nullptr, self->local_addresses()), out_warnings);
-    self->tree = std::move(text.tree);
-    self->comments = std::move(text.comments);
-    return good;
-}
-
-void server_begin(server *self) {
-    if (remove_unfinished_file(self->file.path))
-        self->say("removed what a commit that was cut short has left beside " + self->file.path);
-    if (const std::string open = config_protect(self->file.path); !open.empty())
-        self->say(open);
-    write_facility(self);
-}
-
-static bool read_again(server *self, config_text *out, std::string *out_warnings) {
-    // A file that is gone for a moment is no wish to have everything deleted.
-    if (access(self->file.path.c_str(), R_OK) != 0) {
-        out->errors = self->file.path + ": " + strerror(errno) + "\n";
-        return false;
-    }
-    config_file file = self->file;
-    if (!config_load(&file, out))
-        return false;
-    const std::vector<local_address> local = self->local_addresses();
-    std::string reason;
-    append_lines(self, *out, find_bad_routers(out->tree, &self->tree, local), &out->errors);
-    if (!tree_check_change(self->tree, out->tree, &reason))
-        out->errors += config_complaint(file.path, out->lines, reason);
-    if (!out->errors.empty())
-        return false;
-    append_lines(self, *out, find_bad_routers(out->tree, nullptr, local), out_warnings);
-    self->file = std::move(file);
-    return true;
-}
-
-void server_reload(server *self) {
-    config_text text;
-    std::string warnings;
-    if (!read_again(self, &text, &warnings)) {
-        self->say("configuration not read again:\n" + text.errors);
-        return;
-    }
-    const commit_result commit = {0, "", tree_difference(self->tree.nodes, text.tree.nodes), {}};
-    text.tree.revision = self->tree.revision + (commit.changes.empty() ? 0 : 1);
-    self->comments = std::move(text.comments);
-    self->say("configuration read again: " + std::to_string(commit.changes.size()) + " nodes changed");
-    if (const std::string open = config_protect(self->file.path); !open.empty())
-        self->say(open);
-    if (!warnings.empty())
-        self->say(warnings);
-    take_over(self, std::move(text.tree), commit);
-}
 
 static void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     std::vector<set_step> steps;
