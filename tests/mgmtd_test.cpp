@@ -8,6 +8,7 @@
 #include <sstream>
 
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -521,9 +522,44 @@ TEST_F(Mgmtd, AnInterestHearsWhatItsPatternsName) {
     EXPECT_TRUE(sent.empty()) << "wccpd would end its session";
     action(3, "/mgmtd/reboot", {});
     EXPECT_EQ(message(), "No such action: /mgmtd/reboot");
+    const auto add = [&](size_t number, size_t length) {
+        action(3, "/mgmtd/events/actions/interest/add",
+               {{"event_name", {bn_type_name, "/event/" + std::to_string(number)}},
+                {"match/1/pattern", {bn_type_str, "/" + std::string(length, 'a')}}});
+        return code();
+    };
+    EXPECT_EQ(add(0, INTEREST_BYTES_MAX), static_cast<uint32_t>(LC_NO_SPACE));
+    for (size_t i = 0; i < INTERESTS_MAX; i++)
+        EXPECT_EQ(add(i, 1), 0u);
+    EXPECT_EQ(add(INTERESTS_MAX, 1), static_cast<uint32_t>(LC_NO_SPACE));
+    EXPECT_EQ(add(0, 2), 0u) << "one is replaced";
 }
 
 // --- Queries
+
+TEST_F(Mgmtd, QueriesThatWaitAreBoundedAndKeepNoAnswers) {
+    for (int group = 0; group < 16; group++)
+        daemon.tree.set[{{"qv", "wccpd", "wccp", "srv_grp", "config", std::to_string(group)}}] =
+            std::to_string(group);
+    tree_refresh(&daemon.tree);
+    const size_t before = mallinfo2().uordblks;
+    size_t refused = 0;
+    for (uint32_t i = 0; i < 300; i++) {
+        query(3, "/qv", bn_query_iterate, bn_qf_subtree);
+        refused += sent.back().peer == 3 && code() == LC_NO_SPACE;
+        clear();
+    }
+    EXPECT_EQ(refused, 300 - PENDING_SESSION_MAX);
+    EXPECT_LT(mallinfo2().uordblks - before, 1u << 20);
+    server_peer_opened(&daemon, 4, "mgmtctl-9");
+    query(4, "/qv/wccpd/system/state/" + std::string(PENDING_BYTES_MAX, 'a'), bn_query_get);
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_NO_SPACE));
+    clear();
+    now += MONITOR_TIMEOUT_MS;
+    (void)server_tick(&daemon);
+    EXPECT_EQ(sent.size(), PENDING_SESSION_MAX);
+    EXPECT_TRUE(daemon.pending.empty() && daemon.pending_bytes == 0);
+}
 
 TEST_F(Mgmtd, GetAndIterate) {
     ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"},
@@ -649,4 +685,20 @@ TEST(Supervision, AnEndHasItsNameAndTheNextStartItsDelay) {
                  {W_EXITCODE(0, 0), true, "/pm/events/proc/terminate"}};
     for (const auto &one : cases)
         EXPECT_STREQ(end_event(one.status, one.ending), one.event);
+}
+
+// Its number may be another process's by then.
+TEST(Supervision, AChildWhoseEndSomebodyElseTookInIsOver) {
+    std::vector<std::string> told;
+    supervisor self;
+    self.children.push_back({"quick", {"true"}});
+    self.now_ms = [] { return int64_t{1000}; };
+    self.say = [](const std::string &) {};
+    self.tell = [&](const std::string &event, const std::string &) { told.push_back(event); };
+    (void)supervisor_tick(&self);
+    ASSERT_FALSE(supervisor_is_done(self));
+    ASSERT_EQ(waitpid(self.children[0].pid, nullptr, 0), self.children[0].pid);
+    supervisor_reap(&self);
+    EXPECT_TRUE(supervisor_is_done(self));
+    EXPECT_EQ(told, strings{EVENT_PROCESS_EXIT});
 }

@@ -1,4 +1,5 @@
 // The provider's side of sessions, byte by byte: clients here are raw sockets that share no code with it.
+#include <deque>
 #include <fstream>
 
 #include <gtest/gtest.h>
@@ -70,20 +71,25 @@ struct Transport : testing::Test {
     server daemon;
     transport sockets;
     std::vector<std::string> lines;
+    int64_t now = 0;
 
     void SetUp() override {
-        daemon.now_ms = [] { return int64_t{0}; };
+        daemon.now_ms = [this] { return now; };
         daemon.say = [this](const std::string &line) { lines.push_back(line); };
         tree_refresh(&daemon.tree);
         std::string error;
         ASSERT_TRUE(transport_listen(&sockets, &daemon, &error)) << error;
     }
     void TearDown() override { transport_close(&sockets); }
+    void round() {
+        std::vector<pollfd> none;
+        transport_round(&sockets, &none, 5);
+    }
     // Until nothing happens any more.
     void pump(raw_client *client = nullptr) {
         for (int quiet = 0; quiet < 3; quiet++) {
             size_t before = client ? client->got.size() : 0;
-            (void)transport_round(&sockets, -1, 5);
+            round();
             if (client)
                 client->read_all();
             if (client && client->got.size() != before)
@@ -173,6 +179,7 @@ TEST_F(Transport, WhatCantBeTrueEndsItsSessionAndNoOther) {
         {"a name of no characters", false, greeting_response("")},
         {"somebody else's user", false, greeting_response("mgmtctl-1", geteuid() + 1)},
         {"a service before the greeting", false, open_service(2)},
+        {"a large frame before the service is open", false, with_total(OPENING_FRAME_MAX + 1)},
     };
     for (const auto &one : cases) {
         raw_client client;
@@ -200,7 +207,7 @@ TEST_F(Transport, AClientThatDoesNotReadLosesItsSessionOnly) {
     size_t most = 0;
     for (int i = 0; i < 100 && sockets.sessions.size() == 2; i++) {
         (void)send(deaf.fd, all.data(), all.size(), MSG_NOSIGNAL);
-        (void)transport_round(&sockets, -1, 5);
+        round();
         for (const auto &[id, client] : sockets.sessions)
             most = std::max(most, client.queued_bytes);
         EXPECT_LE(most, QUEUE_MAX_BYTES);
@@ -208,6 +215,27 @@ TEST_F(Transport, AClientThatDoesNotReadLosesItsSessionOnly) {
     EXPECT_EQ(sockets.sessions.size(), 1u);
     EXPECT_GT(most, QUEUE_MAX_BYTES / 2);
     EXPECT_FALSE(ask_for_mode(&bystander).empty());
+}
+
+TEST_F(Transport, ClientsThatCrowdLeaveTheDaemonsTheirPlaces) {
+    std::deque<raw_client> clients, silent, daemons;
+    for (size_t i = 0; i < CLIENT_SESSIONS_MAX; i++)
+        open(&clients.emplace_back(), "mgmtctl-1");
+    raw_client late;
+    pump(&late);
+    late.put(greeting_response("mgmtctl-2"));
+    pump(&late);
+    EXPECT_TRUE(late.closed);
+    while (sockets.sessions.size() < SESSIONS_MAX) {
+        silent.emplace_back();
+        pump();
+    }
+    for (int i = 0; i < 2; i++)
+        open(&daemons.emplace_back(), "wccpd-3");
+    EXPECT_FALSE(ask_for_mode(&clients.front()).empty());
+    now += OPENING_MAX_MS;
+    pump();
+    EXPECT_EQ(sockets.sessions.size(), CLIENT_SESSIONS_MAX + 2) << "those that never greeted are gone";
 }
 
 TEST_F(Transport, TheSocketIsOursAlone) {
@@ -220,6 +248,7 @@ TEST_F(Transport, TheSocketIsOursAlone) {
 
     const auto attempt = [&] {
         server other;
+        other.say = daemon.say;
         transport second;
         std::string error;
         const bool listens = transport_listen(&second, &other, &error);
@@ -227,6 +256,20 @@ TEST_F(Transport, TheSocketIsOursAlone) {
         return listens ? "listens" : error;
     };
     EXPECT_EQ(attempt(), "another mgmtd runs");
+    // Without the directory, or with somebody else's in its place.
+    for (const char *command :
+         {"rm -r /tmp/gcl-socks", "mv /tmp/gcl-socks /tmp/away && mkdir /tmp/gcl-socks"}) {
+        ASSERT_EQ(system(command), 0);
+        EXPECT_EQ(attempt(), "another mgmtd runs");
+        now += LISTENER_CHECK_MS;
+        pump();
+        EXPECT_TRUE(std::count(lines.begin(), lines.end(),
+                               "/tmp/gcl-socks/uds-provider-mgmtd was removed, made again"))
+            << command;
+        lines.clear();
+        raw_client client;
+        open(&client, "wccpd-1");
+    }
     transport_close(&sockets);
     EXPECT_NE(stat("/tmp/gcl-socks/uds-provider-mgmtd", &about), 0) << "removed at the end";
     // Left over from one that was killed.
@@ -235,9 +278,13 @@ TEST_F(Transport, TheSocketIsOursAlone) {
     EXPECT_EQ(attempt(), "listens");
     ASSERT_EQ(stat("/tmp/gcl-socks", &about), 0);
     EXPECT_EQ(about.st_mode & 07777, 0755u) << "what others could write to is closed";
-    if (chown("/tmp/gcl-socks", 1, 1) == 0) { // not where only one user is known
-        EXPECT_EQ(attempt(), "/tmp/gcl-socks: belongs to user 1, not to us");
-    }
+    for (const char *aside : {"/tmp/gcl-socks.moved-1", "/tmp/gcl-socks.moved-2"})
+        if (chown("/tmp/gcl-socks", 1, 1) == 0) { // not where only one user is known
+            EXPECT_EQ(attempt(), "listens");
+            EXPECT_EQ(lines.back(), wire("/tmp/gcl-socks belonged to user 1, moved to ") + aside);
+            ASSERT_EQ(stat(aside, &about), 0);
+            EXPECT_EQ(about.st_uid, 1u);
+        }
     ASSERT_EQ(rename("/tmp/gcl-socks", "/tmp/elsewhere"), 0);
     ASSERT_EQ(symlink("/tmp/elsewhere", "/tmp/gcl-socks"), 0);
     EXPECT_EQ(attempt(), "/tmp/gcl-socks: Not a directory");

@@ -38,7 +38,7 @@ static void say(const std::string &line) {
 static int block_signals() {
     sigset_t set;
     sigemptyset(&set);
-    for (const int number : {SIGTERM, SIGINT, SIGHUP, SIGCHLD})
+    for (const int number : {SIGTERM, SIGINT, SIGHUP})
         sigaddset(&set, number);
     sigprocmask(SIG_BLOCK, &set, nullptr);
     signal(SIGPIPE, SIG_IGN);
@@ -48,9 +48,7 @@ static int block_signals() {
 static void take_signals(int fd, server *daemon, supervisor *processes) {
     signalfd_siginfo info;
     while (read(fd, &info, sizeof info) == sizeof info) {
-        if (info.ssi_signo == SIGCHLD)
-            supervisor_reap(processes);
-        else if (info.ssi_signo == SIGHUP)
+        if (info.ssi_signo == SIGHUP)
             server_reload(daemon);
         else
             processes->ending = true;
@@ -118,8 +116,12 @@ int main(int argc, char **argv) {
         if (processes.ending && supervisor_is_done(processes))
             break;
         const int64_t query_due = server_tick(&daemon);
-        if (transport_round(&sockets, signals, time_left(lt_monotonic_ms(), {child_due, query_due})))
+        std::vector<pollfd> others = {{signals, POLLIN, 0}};
+        supervisor_watch(processes, &others);
+        transport_round(&sockets, &others, time_left(lt_monotonic_ms(), {child_due, query_due}));
+        if (others[0].revents & POLLIN)
             take_signals(signals, &daemon, &processes);
+        supervisor_reap(&processes);
     }
     transport_close(&sockets);
     say("mgmtd ended");

@@ -9,6 +9,7 @@
 #include <algorithm>
 
 #include "mgmt/bnode_proto.h"
+#include "mgmt/gcl.h"
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 
@@ -23,7 +24,9 @@ struct state_source {
 static const state_source sources[] = {
     {"wccpd", {NODE_WCCPD_STATE, NODE_GROUP_STATE}, wccpd_state_nodes},
 };
-static constexpr uint32_t CAPABILITIES = 1; // the nodes can be read
+static constexpr uint32_t CAPABILITIES = 1;       // the nodes can be read
+static constexpr size_t ANSWER_NODE_BYTES = 64;   // of a node in a message, beside its texts
+static constexpr size_t PENDING_NODE_BYTES = 128; // of a node that waits, beside its name
 
 // The newest working session of the daemon: the one that follows changes. 0 for none.
 static uint32_t find_provider(const server *self, const state_source &source, uint32_t asker) {
@@ -62,14 +65,10 @@ struct forwarded {
     uint32_t subop, flags;
     std::string name;
 };
-struct found_node {
-    uint32_t asked_id;
-    const node_map::value_type *node;
-};
 struct query_plan {
     const state_source *source = nullptr;
     std::vector<forwarded> nodes;
-    bool explicit_node = false, local_node = false;
+    bool explicit_node = false;
 };
 } // namespace
 
@@ -95,7 +94,6 @@ static void plan_node(query_plan *plan, uint32_t node_id, uint32_t subop, uint32
                 plan->nodes.push_back({node_id, subop, flags, text});
             }
         }
-    plan->local_node = true;
 }
 
 static void answer_here(const server *self, uint32_t subop, uint32_t flags, const node_name &name,
@@ -113,39 +111,6 @@ static void answer_here(const server *self, uint32_t subop, uint32_t flags, cons
     }
 }
 
-static bool forward(server *self, uint32_t asker, const bn_request_msg *request, const query_plan &plan,
-                    uint32_t provider, const std::vector<found_node> &answered) {
-    owned_request msg;
-    if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK ||
-        !append_registrations(msg.pointer, *plan.source))
-        return false;
-    pending_query query{asker,
-                        provider,
-                        request->msg_id,
-                        request->transaction_id,
-                        self->now_ms() + MONITOR_TIMEOUT_MS,
-                        plan.explicit_node,
-                        {},
-                        {}};
-    for (const found_node &found : answered)
-        query.answered.emplace_back(found.asked_id,
-                                    event_field{found.node->first.text(), found.node->second});
-    for (const forwarded &node : plan.nodes) {
-        uint32_t node_id = 0;
-        if (bn_query_request_msg_append_str(msg.pointer, node.subop, node.flags, node.name.c_str(),
-                                            &node_id) != LC_OK)
-            return false;
-        query.node_ids[node_id] = node.asked_id;
-    }
-    msg.pointer->msg_id = self->next_query_id++;
-    const uint32_t id = msg.pointer->msg_id;
-    self->pending[id] = std::move(query);
-    if (server_send_request(self, provider, msg.pointer))
-        return true;
-    self->pending.erase(id);
-    return false;
-}
-
 static bool append_answer(bn_response_msg *response, uint32_t node_id, const std::string &name,
                           const node_value &value) {
     owned_binding binding(make_binding(name, value));
@@ -153,54 +118,144 @@ static bool append_answer(bn_response_msg *response, uint32_t node_id, const std
            bn_query_response_msg_append_binding_takeover(response, &binding.pointer, node_id) == LC_OK;
 }
 
-void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
-    query_plan plan;
-    std::vector<found_node> answered;
-    const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
-    for (uint32_t i = 0; i < count; i++) {
-        const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
+static void refuse_query(server *self, const pending_query &query, uint32_t code, const std::string &why) {
+    owned_response response;
+    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, code, why.c_str()) == LC_OK)
+        (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
+}
+
+// What mgmtd answers itself. False when that is more than a message holds: the query has been refused.
+static bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
+    size_t bytes = 0;
+    for (const asked_node &asked : query.asked) {
         node_name name;
-        if (!node || !node->binding || !parse_node_name(name_of(node->binding), &name))
-            continue;
-        plan_node(&plan, node->node_id, node->subop, node->flags, name);
         node_list found;
-        answer_here(self, node->subop, node->flags, name, &found);
-        for (const auto *entry : found)
-            answered.push_back({node->node_id, entry});
-    }
-    uint32_t code = 0;
-    std::string message;
-    if (!plan.nodes.empty()) {
-        const uint32_t provider = find_provider(self, *plan.source, peer_id);
-        if (provider && forward(self, peer_id, msg, plan, provider, answered))
-            return;
-        if (plan.explicit_node) {
-            code = LC_IO_CLOSED;
-            message = std::string(plan.source->client) + " has no session";
+        if (parse_node_name(asked.name, &name))
+            answer_here(self, asked.subop, asked.flags, name, &found);
+        for (const auto *entry : found) {
+            const std::string text = entry->first.text();
+            bytes += text.size() + entry->second.text.size() + ANSWER_NODE_BYTES;
+            if (bytes > GCL_FRAME_MAX) {
+                refuse_query(self, query, LC_NO_SPACE, "The answer is larger than a message: ask for less");
+                return false;
+            }
+            (void)append_answer(response, asked.id, text, entry->second);
         }
     }
+    return true;
+}
+
+static std::vector<asked_node> nodes_asked_for(const bn_request_msg *msg) {
+    std::vector<asked_node> out;
+    const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
+    out.reserve(count);
+    for (uint32_t i = 0; i < count; i++)
+        if (const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
+            node && node->binding)
+            out.push_back({node->node_id, node->subop, node->flags, name_of(node->binding)});
+    return out;
+}
+
+pending_query server_take_pending(server *self, std::map<uint32_t, pending_query>::iterator at) {
+    pending_query out = std::move(at->second);
+    self->pending_bytes -= out.bytes;
+    self->pending.erase(at);
+    return out;
+}
+
+static bool may_wait(const server *self, const pending_query &query) {
+    const auto of_asker = std::count_if(self->pending.begin(), self->pending.end(),
+                                        [&](const auto &each) { return each.second.asker == query.asker; });
+    return of_asker < static_cast<ptrdiff_t>(PENDING_SESSION_MAX) && self->pending.size() < PENDING_MAX &&
+           self->pending_bytes + query.bytes <= PENDING_BYTES_MAX;
+}
+
+// The query to the daemon; `query` gets the numbers of its nodes. Null when it can't be made.
+static bn_request_msg *make_forwarded(const query_plan &plan, pending_query *query) {
+    owned_request msg;
+    if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK ||
+        !append_registrations(msg.pointer, *plan.source))
+        return nullptr;
+    for (const forwarded &node : plan.nodes) {
+        uint32_t node_id = 0;
+        if (bn_query_request_msg_append_str(msg.pointer, node.subop, node.flags, node.name.c_str(),
+                                            &node_id) != LC_OK)
+            return nullptr;
+        query->node_ids[node_id] = node.asked_id;
+    }
+    return msg.take();
+}
+
+// 0 when the query waits for the daemon.
+static uint32_t forward(server *self, const query_plan &plan, pending_query query) {
+    query.bytes = 0;
+    for (const asked_node &node : query.asked)
+        query.bytes += node.name.size() + PENDING_NODE_BYTES;
+    query.bytes += plan.nodes.size() * PENDING_NODE_BYTES;
+    if (!may_wait(self, query))
+        return LC_NO_SPACE;
+    const owned_request msg(make_forwarded(plan, &query));
+    if (!msg.pointer)
+        return LC_IO_CLOSED;
+    const uint32_t id = msg.pointer->msg_id = self->next_query_id++, provider = query.provider;
+    self->pending_bytes += query.bytes;
+    self->pending[id] = std::move(query);
+    if (server_send_request(self, provider, msg.pointer))
+        return LC_OK;
+    (void)server_take_pending(self, self->pending.find(id));
+    return LC_IO_CLOSED;
+}
+
+void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
+    query_plan plan;
+    pending_query query = {.asker = peer_id,
+                           .provider = 0,
+                           .asker_message_id = msg->msg_id,
+                           .asker_transaction_id = msg->transaction_id,
+                           .deadline_ms = self->now_ms() + MONITOR_TIMEOUT_MS,
+                           .whole = false,
+                           .asked = nodes_asked_for(msg),
+                           .node_ids = {},
+                           .bytes = 0};
+    for (const asked_node &node : query.asked)
+        if (node_name name; parse_node_name(node.name, &name))
+            plan_node(&plan, node.id, node.subop, node.flags, name);
+    query.whole = plan.explicit_node;
+    uint32_t code = LC_OK;
+    if (!plan.nodes.empty()) {
+        query.provider = find_provider(self, *plan.source, peer_id);
+        code = query.provider ? forward(self, plan, query) : uint32_t{LC_IO_CLOSED};
+        if (code == LC_OK)
+            return;
+        if (code == LC_NO_SPACE) {
+            refuse_query(self, query, code, "Too many queries wait for " + std::string(plan.source->client));
+            return;
+        }
+    }
+    server_answer_without(self, query, code,
+                          plan.source ? plan.source->client + std::string(" has no session") : "");
+}
+
+void server_answer_without(server *self, const pending_query &query, uint32_t code, const std::string &why) {
     owned_response response;
-    if (bn_query_response_msg_create(&response.pointer, msg->msg_id, code, message.c_str()) != LC_OK)
-        return;
-    for (const found_node &found : answered)
-        (void)append_answer(response.pointer, found.asked_id, found.node->first.text(), found.node->second);
-    (void)server_send_response(self, peer_id, response.pointer, msg->transaction_id);
+    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, query.whole ? code : 0,
+                                     query.whole ? why.c_str() : "") == LC_OK &&
+        append_own_answers(self, query, response.pointer))
+        (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
 }
 
 void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg) {
     const auto found = self->pending.find(msg->response_to);
     if (found == self->pending.end() || found->second.provider != peer_id)
         return; // too late, or never asked for
-    const pending_query query = std::move(found->second);
-    self->pending.erase(found);
+    const pending_query query = server_take_pending(self, found);
     owned_response response;
     const bool told = query.whole && msg->return_message;
     if (bn_query_response_msg_create(&response.pointer, query.asker_message_id,
                                      query.whole ? msg->return_code : 0,
-                                     told ? ts_str(msg->return_message) : "") != LC_OK)
+                                     told ? ts_str(msg->return_message) : "") != LC_OK ||
+        !append_own_answers(self, query, response.pointer))
         return;
-    for (const auto &[node_id, field] : query.answered)
-        (void)append_answer(response.pointer, node_id, field.name, field.value);
     const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
     for (uint32_t i = 0; i < count; i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);

@@ -90,6 +90,23 @@ struct action_answer {
     std::string message;
 };
 
+static size_t text_bytes(const interest &wish) {
+    size_t bytes = wish.event.size();
+    for (const std::string &pattern : wish.patterns)
+        bytes += pattern.size() + sizeof(std::string);
+    return bytes;
+}
+
+static bool may_add_interest(const peer &who, const interest &wish) {
+    size_t count = 1, bytes = text_bytes(wish);
+    for (const interest &old : who.interests)
+        if (old.event != wish.event) {
+            count++;
+            bytes += text_bytes(old);
+        }
+    return count <= INTERESTS_MAX && bytes <= INTEREST_BYTES_MAX;
+}
+
 // "match/N/pattern" in the order of N; the order doesn't matter to a match.
 static action_answer add_interest(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     interest wish;
@@ -109,6 +126,8 @@ static action_answer add_interest(server *self, uint32_t peer_id, const std::vec
         if (node_name parsed; !parse_node_name(pattern, &parsed))
             return {LC_BAD_ARGUMENT, "No pattern: " + pattern};
     peer &who = self->peers[peer_id];
+    if (!may_add_interest(who, wish))
+        return {LC_NO_SPACE, "Too many interests, or too long ones, for one session"};
     std::erase_if(who.interests, [&](const interest &old) { return old.event == wish.event; });
     who.interests.push_back(std::move(wish));
     return {};
@@ -201,19 +220,6 @@ void server_peer_opened(server *self, uint32_t peer_id, const std::string &name)
     self->say("session of " + name + " open");
 }
 
-static void answer_without(server *self, const pending_query &query, uint32_t code, const std::string &why) {
-    owned_response response;
-    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, query.whole ? code : 0,
-                                     query.whole ? why.c_str() : "") != LC_OK)
-        return;
-    for (const auto &[node_id, field] : query.answered) {
-        owned_binding binding(make_binding(field.name, field.value));
-        if (binding.pointer)
-            (void)bn_query_response_msg_append_binding_takeover(response.pointer, &binding.pointer, node_id);
-    }
-    (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
-}
-
 void server_peer_closed(server *self, uint32_t peer_id) {
     const auto found = self->peers.find(peer_id);
     if (found == self->peers.end())
@@ -223,13 +229,14 @@ void server_peer_closed(server *self, uint32_t peer_id) {
     self->peers.erase(found);
     std::vector<pending_query> left;
     for (auto at = self->pending.begin(); at != self->pending.end();) {
-        const bool gone = at->second.asker == peer_id || at->second.provider == peer_id;
-        if (at->second.provider == peer_id)
-            left.push_back(at->second);
-        at = gone ? self->pending.erase(at) : std::next(at);
+        const auto query = at++;
+        if (query->second.provider == peer_id)
+            left.push_back(server_take_pending(self, query));
+        else if (query->second.asker == peer_id)
+            (void)server_take_pending(self, query);
     }
     for (const pending_query &query : left)
-        answer_without(self, query, LC_IO_CLOSED, name + " ended its session before it answered");
+        server_answer_without(self, query, LC_IO_CLOSED, name + " ended its session before it answered");
     server_forget_reports(self, peer_id);
 }
 
@@ -238,20 +245,17 @@ int64_t server_tick(server *self) {
     int64_t next = -1;
     std::vector<pending_query> late;
     for (auto at = self->pending.begin(); at != self->pending.end();) {
-        if (at->second.deadline_ms <= now) {
-            late.push_back(at->second);
-            at = self->pending.erase(at);
-            continue;
-        }
-        if (next < 0 || at->second.deadline_ms < next)
-            next = at->second.deadline_ms;
-        ++at;
+        const auto query = at++;
+        if (query->second.deadline_ms <= now)
+            late.push_back(server_take_pending(self, query));
+        else if (next < 0 || query->second.deadline_ms < next)
+            next = query->second.deadline_ms;
     }
     for (const pending_query &query : late) {
         const auto provider = self->peers.find(query.provider);
         const std::string name = provider == self->peers.end() ? "the daemon" : provider->second.name;
         self->say("query: no answer from " + name);
-        answer_without(self, query, LC_IO_TIMED_OUT, name + " did not answer in time");
+        server_answer_without(self, query, LC_IO_TIMED_OUT, name + " did not answer in time");
     }
     return next;
 }

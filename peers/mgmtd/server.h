@@ -14,6 +14,10 @@
 
 constexpr int64_t MONITOR_TIMEOUT_MS = 5000;
 constexpr size_t ALARMS_MAX = 4096; // that are kept
+// What clients can make mgmtd keep for them: queries that wait for a daemon, of one session and of all, and
+// the names in these; the interests of one session, and the text in these.
+constexpr size_t PENDING_SESSION_MAX = 32, PENDING_MAX = 512, PENDING_BYTES_MAX = 8u << 20;
+constexpr size_t INTERESTS_MAX = 64, INTEREST_BYTES_MAX = 64u << 10;
 
 struct interest {
     std::string event;
@@ -26,14 +30,20 @@ struct peer {
     uint64_t first_seen = 0;
 };
 
-// A query that waits for the daemon whose nodes it asks for.
+struct asked_node {
+    uint32_t id, subop, flags;
+    std::string name;
+};
+// A query that waits for the daemon whose nodes it asks for. What mgmtd answers of it itself is looked up
+// when the daemon has answered, and not kept until then.
 struct pending_query {
     uint32_t asker, provider;
     uint32_t asker_message_id, asker_transaction_id;
     int64_t deadline_ms;
-    bool whole; // every node of it went to the provider, so that no answer is a failure
-    std::vector<std::pair<uint32_t, event_field>> answered; // node id and binding, answered here
-    std::map<uint32_t, uint32_t> node_ids;                  // of the forwarded query to the asker's
+    bool whole;                            // it asks for the daemon's nodes by name: no answer is a failure
+    std::vector<asked_node> asked;         // as they came
+    std::map<uint32_t, uint32_t> node_ids; // of the forwarded query to the asker's
+    size_t bytes;                          // that count against PENDING_BYTES_MAX
 };
 
 struct server {
@@ -49,7 +59,8 @@ struct server {
     config_comments comments;
     node_map state; // nodes that mgmtd itself reports
     std::map<uint32_t, peer> peers;
-    std::map<uint32_t, pending_query> pending;  // by the message id of the forwarded query
+    std::map<uint32_t, pending_query> pending; // by the message id of the forwarded query
+    size_t pending_bytes = 0;
     std::map<node_name, uint32_t> alarm_owners; // root nodes of what a session reported
     uint32_t next_query_id = 0x40000000;        // apart from the ids of other messages
     uint64_t peers_seen = 0;
@@ -80,6 +91,10 @@ void server_reload(server *self);
 bool server_send_request(server *self, uint32_t peer_id, bn_request_msg *msg);
 bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, uint32_t transaction_id);
 void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg);
+// Takes a query out of those that wait.
+pending_query server_take_pending(server *self, std::map<uint32_t, pending_query>::iterator at);
+// The answer to a query that no daemon answers any more.
+void server_answer_without(server *self, const pending_query &query, uint32_t code, const std::string &why);
 void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg);
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,
                        const std::vector<event_field> &fields);

@@ -1,9 +1,10 @@
-// Supervision.
-//
 // A child that ends is reported first and started again later: the daemon that hears of the end of tunneld
 // exits by itself, and is started again like any other. The delay doubles from one second to thirty with
 // each end and falls back after a run that lasted. Children get default signal handling, an empty signal
-// mask and SIGTERM should mgmtd die before them, so that its next start finds the field clear.
+// mask and SIGTERM should mgmtd die before them, so that its next start finds none of them left.
+//
+// A child is held by a descriptor of the process and not by its number: the number may be another process's
+// as soon as somebody else has taken in the child's end.
 #include "peers/mgmtd/supervise.h"
 
 #include <algorithm>
@@ -15,6 +16,10 @@
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+extern "C" {
+#include <sys/pidfd.h> // glibc 2.36 doesn't say so itself
+}
 
 #include "mgmt/node_paths.h"
 #include "runtime/common.h"
@@ -43,7 +48,8 @@ static std::string end_text(int wait_status) {
     sigset_t none;
     sigemptyset(&none);
     sigprocmask(SIG_SETMASK, &none, nullptr);
-    signal(SIGPIPE, SIG_DFL);
+    for (int number = 1; number < NSIG; number++) // what was ignored would stay so
+        signal(number, SIG_DFL);
     std::vector<char *> arguments;
     arguments.reserve(command.size() + 1);
     for (const std::string &word : command)
@@ -54,30 +60,67 @@ static std::string end_text(int wait_status) {
     _exit(127);
 }
 
-static void start(supervisor *self, child *process) {
+// Null, or the step that failed, with errno.
+static const char *fork_child(child *process) {
     const pid_t parent = getpid();
+    signal(SIGCHLD, SIG_DFL); // ignored, a child would be gone with its status before anybody looks
     const pid_t pid = fork();
     if (pid == 0)
         become(process->command, parent);
+    if (pid < 0)
+        return "fork";
+    process->pid = pid;
+    process->pidfd = pidfd_open(pid, 0); // its number is its own until its end is taken in
+    if (process->pidfd >= 0)
+        return nullptr;
+    const int error = errno;
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+    errno = error;
+    return "pidfd_open";
+}
+
+static void start(supervisor *self, child *process) {
+    const char *failed = fork_child(process);
     process->started_ms = self->now_ms();
-    if (pid < 0) {
+    if (failed) {
+        const std::string reason = strerror(errno);
         process->delay_ms = next_delay(process->delay_ms, 0);
         process->start_at_ms = process->started_ms + process->delay_ms;
-        self->say("process " + process->name + ": fork: " + strerror(errno));
+        self->say("process " + process->name + ": " + failed + ": " + reason);
         return;
     }
-    process->pid = pid;
     process->kill_at_ms = -1;
-    self->say("process " + process->name + ": started, pid " + std::to_string(pid));
+    self->say("process " + process->name + ": started, pid " + std::to_string(process->pid));
+}
+
+void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout) {
+    for (const child &process : self.children)
+        inout->push_back({process.pidfd, POLLIN, 0});
+}
+
+// Whether it has ended, and its wait status. An end that somebody else has taken in counts as an exit with 0.
+static bool has_ended(const child &process, int *out_status) {
+    siginfo_t info = {};
+    *out_status = 0;
+    if (process.pidfd < 0)
+        return false;
+    if (waitid(P_PIDFD, static_cast<id_t>(process.pidfd), &info, WEXITED | WNOHANG) != 0)
+        return errno == ECHILD;
+    if (info.si_pid == 0)
+        return false;
+    *out_status = info.si_code == CLD_EXITED ? W_EXITCODE(info.si_status, 0) : info.si_status;
+    return true;
 }
 
 void supervisor_reap(supervisor *self) {
     for (child &process : self->children) {
         int status = 0;
-        if (process.pid == 0 || waitpid(process.pid, &status, WNOHANG) != process.pid)
+        if (!has_ended(process, &status))
             continue;
         const int64_t now = self->now_ms();
-        process.pid = 0;
+        close(process.pidfd);
+        process.pidfd = -1;
         process.delay_ms = next_delay(process.delay_ms, now - process.started_ms);
         process.start_at_ms = now + process.delay_ms;
         self->say(
@@ -89,14 +132,14 @@ void supervisor_reap(supervisor *self) {
 
 static int64_t end_last(supervisor *self, int64_t now) {
     for (auto process = self->children.rbegin(); process != self->children.rend(); ++process) {
-        if (process->pid == 0)
+        if (process->pidfd < 0)
             continue;
         if (process->kill_at_ms < 0) {
-            kill(process->pid, SIGTERM);
+            pidfd_send_signal(process->pidfd, SIGTERM, nullptr, 0);
             process->kill_at_ms = now + END_PATIENCE_MS;
         } else if (now >= process->kill_at_ms) {
             self->say("process " + process->name + ": does not end, killed");
-            kill(process->pid, SIGKILL);
+            pidfd_send_signal(process->pidfd, SIGKILL, nullptr, 0);
             process->kill_at_ms = now + END_PATIENCE_MS;
         }
         return process->kill_at_ms;
@@ -110,9 +153,9 @@ int64_t supervisor_tick(supervisor *self) {
         return end_last(self, now);
     int64_t next = -1;
     for (child &process : self->children) {
-        if (process.pid == 0 && process.start_at_ms <= now)
+        if (process.pidfd < 0 && process.start_at_ms <= now)
             start(self, &process);
-        if (process.pid == 0 && (next < 0 || process.start_at_ms < next))
+        if (process.pidfd < 0 && (next < 0 || process.start_at_ms < next))
             next = process.start_at_ms;
     }
     return next;
@@ -120,5 +163,5 @@ int64_t supervisor_tick(supervisor *self) {
 
 bool supervisor_is_done(const supervisor &self) {
     return std::all_of(self.children.begin(), self.children.end(),
-                       [](const child &process) { return process.pid == 0; });
+                       [](const child &process) { return process.pidfd < 0; });
 }

@@ -1,4 +1,4 @@
-// The processes that mgmtd starts: started, seen to end, told about, started again.
+// The processes that mgmtd starts: started, seen to end, reported, started again.
 #pragma once
 
 #include <cstdint>
@@ -6,16 +6,19 @@
 #include <string>
 #include <vector>
 
+#include <poll.h>
 #include <sys/types.h>
 
 constexpr int64_t RESTART_DELAY_FIRST_MS = 1000, RESTART_DELAY_MAX_MS = 30000;
-constexpr int64_t SETTLED_MS = 60000;     // a run of this length starts the delays over
-constexpr int64_t END_PATIENCE_MS = 5000; // from SIGTERM to SIGKILL
+constexpr int64_t SETTLED_MS = 60000; // a run of this length starts the delays over
+// From SIGTERM to SIGKILL. wccpd's orderly exit takes up to 5 s when tunneld doesn't answer.
+constexpr int64_t END_PATIENCE_MS = 10000;
 
 struct child {
     std::string name;
     std::vector<std::string> command;
-    pid_t pid = 0; // 0: does not run
+    pid_t pid = 0;
+    int pidfd = -1; // -1: does not run
     int64_t started_ms = 0, start_at_ms = 0, delay_ms = 0;
     int64_t kill_at_ms = -1;
 };
@@ -27,6 +30,8 @@ struct supervisor {
     bool ending = false;
 };
 
+// Appends what becomes readable when a process ends.
+void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout);
 // Takes in who has ended.
 void supervisor_reap(supervisor *self);
 // Starts who is due, or when ending, ends one after the other, the last started first. Gives the time of the
@@ -35,5 +40,5 @@ int64_t supervisor_tick(supervisor *self);
 bool supervisor_is_done(const supervisor &self); // nobody runs
 // What an end is called: the event, by the wait status.
 const char *end_event(int wait_status, bool ending);
-// The delay before the next start, after a run of so long behind a delay of `before_ms`.
+// The delay before the next start, after a run of so long after a delay of `before_ms`.
 int64_t next_delay(int64_t before_ms, int64_t ran_ms);

@@ -1,144 +1,46 @@
 // The sessions' sockets, one poll loop for all of them.
 //
 // A session goes: greeting sent, greeted (the client's name is known), open (the bnode service granted).
-// Frames are whole before anything looks at them, and a header that can't be true ends its session, so what
-// a client makes mgmtd hold is bounded by GCL_FRAME_MAX in and QUEUE_MAX_BYTES out. A client that doesn't
-// read never stops the others: nothing here blocks.
+// Frames are whole before anything looks at them, and a header that can't be true ends its session. What a
+// client makes mgmtd hold is therefore bounded by GCL_FRAME_MAX in and QUEUE_MAX_BYTES out. A client that
+// doesn't read never stops the others: nothing here blocks.
 //
-// The directory lies in /tmp, where anybody may have made it first: it has to be a real directory of our own
-// user that nobody else may write to. The lock on it, held as long as the process lives, keeps a second
-// mgmtd off, and tells that a socket found in it is left over. The kernel says who a client is; only root
-// and our own user are let in.
-//
-// A client binds a name there too, and removes it when it ends. What a killed one leaves is removed when
-// mgmtd starts and with each session that comes. Not when a session ends: then its process is still about to
-// go, and all sessions of a process share one name. A name that goes too early harms nobody, since a session
-// is connected by then, or connects to mgmtd's name and not to its own.
+// The kernel says who a client is; only root and our own user are let in. Clients that crowd the socket leave
+// the daemons their places: the name in the greeting decides, and whoever takes long over the greeting gives
+// way to a new connection.
 #include "peers/mgmtd/transport.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <charconv>
 #include <climits>
-#include <csignal>
-#include <cstdlib>
 #include <cstring>
-#include <memory>
-#include <string_view>
-#include <vector>
 
-#include <dirent.h>
-#include <fcntl.h>
-#include <poll.h>
 #include <pwd.h>
-#include <sys/file.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include "mgmt/bnode_proto.h"
 #include "mgmt/gcl.h"
 #include "mgmt/gcl_wire.h"
-#include "peers/nodes/provider_path.h"
 
 static constexpr const char *PROVIDER_NAME = "mgmtd";
 static constexpr int READS_A_TURN = 16; // then the others have theirs
+static constexpr const char *DAEMONS[] = {"wccpd-", "tunneld-"}; // what their names begin with
 
 static void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken);
-
-// --- The socket
-
-static bool fail(std::string *out_error, const std::string &what) {
-    *out_error = what + ": " + strerror(errno);
-    return false;
-}
-
-static bool open_directory(transport *self, std::string *out_error) {
-    const std::string path(GCL_SOCKET_DIRECTORY, strlen(GCL_SOCKET_DIRECTORY) - 1);
-    if (mkdir(path.c_str(), 0755) != 0 && errno != EEXIST)
-        return fail(out_error, path);
-    self->directory = open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-    struct stat about;
-    if (self->directory < 0 || fstat(self->directory, &about) != 0)
-        return fail(out_error, path);
-    if (about.st_uid != geteuid()) {
-        *out_error = path + ": belongs to user " + std::to_string(about.st_uid) + ", not to us";
-        return false;
-    }
-    if ((about.st_mode & 07777) != 0755 && fchmod(self->directory, 0755) != 0)
-        return fail(out_error, path);
-    if (flock(self->directory, LOCK_EX | LOCK_NB) != 0) {
-        *out_error = "another mgmtd runs";
-        return false;
-    }
-    return true;
-}
-
-// The process that a client's socket is of, by its name "uds-client-NAME-PID"; 0 for other files.
-static pid_t client_of_socket(std::string_view file) {
-    pid_t pid = 0;
-    const size_t dash = file.rfind('-');
-    if (!file.starts_with("uds-client-") || dash == std::string_view::npos)
-        return 0;
-    const char *end = file.data() + file.size();
-    const auto [last, error] = std::from_chars(file.data() + dash + 1, end, pid);
-    return error == std::errc() && last == end && pid > 0 ? pid : 0;
-}
-
-static void remove_left_over(const transport *self) {
-    const int fd = openat(self->directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    DIR *opened = fd < 0 ? nullptr : fdopendir(fd);
-    if (!opened) {
-        if (fd >= 0)
-            close(fd);
-        return;
-    }
-    const std::unique_ptr<DIR, int (*)(DIR *)> files(opened, closedir);
-    while (const dirent *file = readdir(files.get())) {
-        const pid_t pid = client_of_socket(file->d_name);
-        struct stat about;
-        if (pid > 0 && kill(pid, 0) != 0 && errno == ESRCH &&
-            fstatat(self->directory, file->d_name, &about, AT_SYMLINK_NOFOLLOW) == 0 &&
-            S_ISSOCK(about.st_mode))
-            unlinkat(self->directory, file->d_name, 0);
-    }
-}
 
 bool transport_listen(transport *self, server *owner, std::string *out_error) {
     self->owner = owner;
     owner->send = [self](uint32_t id, uint16_t mtype, tbuffer *frame) { send_bnode(self, id, mtype, frame); };
-    if (!open_directory(self, out_error))
-        return false;
-    remove_left_over(self);
-    self->socket_path = provider_path();
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    strlcpy(address.sun_path, self->socket_path.c_str(), sizeof address.sun_path);
-    unlink(address.sun_path);
-    self->listener = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
-    if (self->listener < 0)
-        return fail(out_error, "socket");
-    // The length that clients connect with may count less than the whole record; the path decides.
-    const mode_t before = umask(0177);
-    const int bound = bind(self->listener, reinterpret_cast<sockaddr *>(&address), sizeof address);
-    umask(before);
-    if (bound != 0 || listen(self->listener, 16) != 0)
-        return fail(out_error, self->socket_path);
-    return true;
+    self->place.say = owner->say;
+    return listener_open(&self->place, out_error);
 }
 
 void transport_close(transport *self) {
     for (auto &[id, session] : self->sessions)
         close(session.fd);
     self->sessions.clear();
-    if (self->listener >= 0) {
-        close(self->listener);
-        unlink(self->socket_path.c_str());
-    }
-    if (self->directory >= 0)
-        close(self->directory);
-    self->listener = self->directory = -1;
+    listener_close(&self->place);
 }
 
 // --- Sending
@@ -233,6 +135,19 @@ static std::string field_text(const char (&field)[32]) {
     return {field, strnlen(field, sizeof field)};
 }
 
+static bool is_daemon(const std::string &name) {
+    return std::any_of(std::begin(DAEMONS), std::end(DAEMONS),
+                       [&](const char *prefix) { return name.starts_with(prefix); });
+}
+
+static bool has_place(const transport *self, const std::string &name) {
+    const auto clients = std::count_if(self->sessions.begin(), self->sessions.end(), [](const auto &each) {
+        const session &other = each.second;
+        return !other.ended && other.stage != session::greeting_sent && !is_daemon(other.name);
+    });
+    return is_daemon(name) || clients < static_cast<ptrdiff_t>(CLIENT_SESSIONS_MAX);
+}
+
 static bool take_greeting_response(transport *self, session *client, const std::string &frame) {
     gcl_wire_greeting_response response;
     if (frame.size() < sizeof(gcl_wire_header) + sizeof response || client->stage != session::greeting_sent) {
@@ -247,6 +162,10 @@ static bool take_greeting_response(transport *self, session *client, const std::
     if (to_host(response.version) != GCL_ADMIN_VERSION || !printable ||
         (uid != client->uid && uid != UINT32_MAX)) {
         end_session(self, client, "bad version, name or user in its greeting response");
+        return false;
+    }
+    if (!has_place(self, name)) {
+        end_session(self, client, "of " + name + " refused: too many");
         return false;
     }
     client->name = name;
@@ -305,11 +224,12 @@ static void take_frame(transport *self, uint32_t id, session *client, const gcl_
     }
 }
 
-static bool header_is_sound(const gcl_wire_header &header) {
+static bool header_is_sound(const session &client, const gcl_wire_header &header) {
     const uint32_t total = to_host(header.total_length);
+    const uint32_t most = client.stage == session::open ? GCL_FRAME_MAX : OPENING_FRAME_MAX;
     return memcmp(header.ident, GCL_FRAME_IDENT, sizeof header.ident) == 0 &&
            to_host(header.version) == GCL_FRAME_VERSION && to_host(header.header_length) == sizeof header &&
-           total >= sizeof header && total <= GCL_FRAME_MAX;
+           total >= sizeof header && total <= most;
 }
 
 static void take_frames(transport *self, uint32_t id, session *client) {
@@ -317,7 +237,7 @@ static void take_frames(transport *self, uint32_t id, session *client) {
     while (!client->ended && client->unread.size() - at >= sizeof(gcl_wire_header)) {
         gcl_wire_header header;
         memcpy(&header, client->unread.data() + at, sizeof header);
-        if (!header_is_sound(header)) {
+        if (!header_is_sound(*client, header)) {
             end_session(self, client, "bad frame header, ended");
             break;
         }
@@ -350,19 +270,30 @@ static void read_session(transport *self, uint32_t id, session *client) {
     }
 }
 
+// False when all places are taken by sessions that have greeted.
+static bool make_room(transport *self) {
+    if (self->sessions.size() < SESSIONS_MAX)
+        return true;
+    for (auto &[id, client] : self->sessions) // the oldest first
+        if (client.stage == session::greeting_sent && !client.ended) {
+            end_session(self, &client, "gave way to another, it has not greeted");
+            return true;
+        }
+    return false;
+}
+
 static void accept_session(transport *self) {
-    const int fd = accept4(self->listener, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
+    const int fd = accept4(self->place.socket, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
     if (fd < 0)
         return;
-    remove_left_over(self);
+    listener_tidy(&self->place);
     ucred credentials{};
     socklen_t length = sizeof credentials;
     const bool known = getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &credentials, &length) == 0;
-    if (!known || (credentials.uid != 0 && credentials.uid != geteuid()) ||
-        self->sessions.size() >= SESSIONS_MAX) {
-        self->owner->say(self->sessions.size() >= SESSIONS_MAX
-                             ? "session refused: too many"
-                             : "session refused: user " + std::to_string(credentials.uid));
+    const bool trusted = known && (credentials.uid == 0 || credentials.uid == geteuid());
+    if (!trusted || !make_room(self)) {
+        self->owner->say(trusted ? "session refused: too many"
+                                 : "session refused: user " + std::to_string(credentials.uid));
         close(fd);
         return;
     }
@@ -370,6 +301,7 @@ static void accept_session(transport *self) {
     client.fd = fd;
     client.uid = credentials.uid;
     client.sequence = GCL_SEQUENCE_PROVIDER;
+    client.open_by_ms = self->owner->now_ms() + OPENING_MAX_MS;
     send_greeting(self, &client);
 }
 
@@ -390,30 +322,52 @@ static void sweep(transport *self) {
     }
 }
 
-bool transport_round(transport *self, int other_fd, int64_t timeout_ms) {
+// What is due by the clock. Gives the time until the next of it, `timeout_ms` at most (-1: no limit).
+static int64_t run_timers(transport *self, int64_t timeout_ms) {
+    const int64_t now = self->owner->now_ms();
+    if (now >= self->check_place_at_ms) {
+        listener_check(&self->place);
+        self->check_place_at_ms = now + LISTENER_CHECK_MS;
+    }
+    int64_t next = self->check_place_at_ms;
+    for (auto &[id, client] : self->sessions) {
+        if (client.stage == session::open)
+            continue;
+        if (now >= client.open_by_ms)
+            end_session(self, &client, "did not finish its opening, ended");
+        next = std::min(next, client.open_by_ms);
+    }
+    const int64_t left = std::max<int64_t>(next - now, 0);
+    return timeout_ms < 0 ? left : std::min(timeout_ms, left);
+}
+
+void transport_round(transport *self, std::vector<pollfd> *inout_others, int64_t timeout_ms) {
+    const int64_t limit_ms = run_timers(self, timeout_ms);
     for (auto &[id, client] : self->sessions)
         flush(self, &client);
     sweep(self);
-    std::vector<pollfd> watched = {{other_fd, POLLIN, 0}, {self->listener, POLLIN, 0}};
+    std::vector<pollfd> watched = *inout_others;
+    const size_t others = watched.size();
+    watched.push_back({self->place.socket, POLLIN, 0});
     std::vector<uint32_t> ids;
     for (const auto &[id, client] : self->sessions) {
         watched.push_back({client.fd, static_cast<short>(POLLIN | (client.queue.empty() ? 0 : POLLOUT)), 0});
         ids.push_back(id);
     }
-    const int timeout = static_cast<int>(std::clamp<int64_t>(timeout_ms, -1, INT_MAX));
-    if (poll(watched.data(), watched.size(), timeout) <= 0)
-        return false;
+    if (poll(watched.data(), watched.size(), static_cast<int>(std::min<int64_t>(limit_ms, INT_MAX))) <= 0)
+        return;
+    std::copy_n(watched.begin(), others, inout_others->begin());
     for (size_t i = 0; i < ids.size(); i++) {
         session &client = self->sessions[ids[i]];
-        if (watched[i + 2].revents & POLLOUT)
+        const short came = watched[others + 1 + i].revents;
+        if (came & POLLOUT)
             flush(self, &client);
-        if (watched[i + 2].revents & (POLLIN | POLLHUP | POLLERR))
+        if (came & (POLLIN | POLLHUP | POLLERR))
             read_session(self, ids[i], &client);
     }
-    if (watched[1].revents & POLLIN)
+    if (watched[others].revents & POLLIN)
         accept_session(self);
     for (auto &[id, client] : self->sessions)
         flush(self, &client);
     sweep(self);
-    return (watched[0].revents & POLLIN) != 0;
 }

@@ -1,0 +1,220 @@
+// The directory lies in /tmp, where anybody may have made it first: it has to be a real directory of our own
+// user that nobody else may write to. Root moves what somebody else put there out of the way, which the owner
+// cannot undo in a /tmp with the sticky bit. Other users leave it and report it.
+//
+// Two locks keep a second mgmtd off. The one on the directory also tells that a socket in it is left over
+// from an mgmtd that was killed, but it goes with the directory, which anything that cleans /tmp may remove.
+// Root's mgmtd therefore locks a file in /var/run as well. Both are held as long as the process lives.
+//
+// A client binds a name in the directory too, and removes it when it ends. What a killed one leaves is
+// removed when mgmtd starts and with each session that comes. Not when a session ends: its process is only
+// about to end then, and all sessions of a process share one name. A name that goes too early harms nobody,
+// because a session is connected by then, or connects to mgmtd's name and not to its own.
+#include "peers/mgmtd/listener.h"
+
+#include <cerrno>
+#include <charconv>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+#include <memory>
+#include <string_view>
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include "mgmt/gcl_wire.h"
+#include "peers/nodes/provider_path.h"
+#include "runtime/common.h"
+
+static constexpr int BACKLOG = 64;
+static constexpr int MOVES_MAX = 1000;     // names that are tried for what is moved aside
+static constexpr int DIRECTORY_TRIES = 16; // against somebody who makes it again at the same time
+
+static bool fail(std::string *out_error, const std::string &what) {
+    *out_error = what + ": " + strerror(errno);
+    return false;
+}
+
+static void close_fd(int *fd) {
+    if (*fd >= 0)
+        close(*fd);
+    *fd = -1;
+}
+
+static bool lock_alone(int fd, const std::string &path, std::string *out_error) {
+    if (flock(fd, LOCK_EX | LOCK_NB) == 0)
+        return true;
+    if (errno != EWOULDBLOCK)
+        return fail(out_error, path);
+    *out_error = "another mgmtd runs";
+    return false;
+}
+
+static bool take_lock_file(listener *self, std::string *out_error) {
+    if (geteuid() != 0)
+        return true; // /var/run is root's
+    self->lock = open(MGMTD_LOCK_FILE, O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600);
+    if (self->lock < 0)
+        return fail(out_error, MGMTD_LOCK_FILE);
+    return lock_alone(self->lock, MGMTD_LOCK_FILE, out_error);
+}
+
+// --- The directory
+
+static bool move_aside(const listener *self, const std::string &path, uid_t owner, std::string *out_error) {
+    for (int i = 1; i <= MOVES_MAX; i++) {
+        const std::string aside = path + ".moved-" + std::to_string(i);
+        if (renameat2(AT_FDCWD, path.c_str(), AT_FDCWD, aside.c_str(), RENAME_NOREPLACE) == 0) {
+            self->say(path + " belonged to user " + std::to_string(owner) + ", moved to " + aside);
+            return true;
+        }
+        if (errno == ENOENT) // its owner was faster
+            return true;
+        if (errno != EEXIST)
+            break;
+    }
+    return fail(out_error, path + ": belongs to user " + std::to_string(owner) + " and can't be moved aside");
+}
+
+// False with the reason; `out_again` when it is worth another try.
+static bool open_own_directory(const listener *self, const std::string &path, int *out_fd, bool *out_again,
+                               std::string *out_error) {
+    struct stat about;
+    *out_again = false;
+    if (mkdir(path.c_str(), 0755) != 0 && errno != EEXIST)
+        return fail(out_error, path);
+    if (lstat(path.c_str(), &about) != 0) {
+        *out_again = errno == ENOENT;
+        return fail(out_error, path);
+    }
+    if (about.st_uid != geteuid() && geteuid() == 0) {
+        *out_again = move_aside(self, path, about.st_uid, out_error);
+        return false;
+    }
+    *out_fd = open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (*out_fd < 0 || fstat(*out_fd, &about) != 0)
+        return fail(out_error, path);
+    if (about.st_uid == geteuid())
+        return true;
+    *out_error = path + ": belongs to user " + std::to_string(about.st_uid) + ", not to us";
+    return false;
+}
+
+static bool open_directory(const listener *self, int *out_fd, std::string *out_error) {
+    const std::string path(GCL_SOCKET_DIRECTORY, strlen(GCL_SOCKET_DIRECTORY) - 1);
+    bool again = true;
+    for (int i = 0; again && i < DIRECTORY_TRIES; i++) {
+        close_fd(out_fd);
+        if (!open_own_directory(self, path, out_fd, &again, out_error))
+            continue;
+        if (fchmod(*out_fd, 0755) != 0)
+            return fail(out_error, path);
+        return lock_alone(*out_fd, path, out_error);
+    }
+    return false;
+}
+
+// The process that a client's socket is of, by its name "uds-client-NAME-PID"; 0 for other files.
+static pid_t client_of_socket(std::string_view file) {
+    pid_t pid = 0;
+    const size_t dash = file.rfind('-');
+    if (!file.starts_with("uds-client-") || dash == std::string_view::npos)
+        return 0;
+    const char *end = file.data() + file.size();
+    const auto [last, error] = std::from_chars(file.data() + dash + 1, end, pid);
+    return error == std::errc() && last == end && pid > 0 ? pid : 0;
+}
+
+void listener_tidy(const listener *self) {
+    const int fd = openat(self->directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    DIR *opened = fd < 0 ? nullptr : fdopendir(fd);
+    if (!opened) {
+        if (fd >= 0)
+            close(fd);
+        return;
+    }
+    const std::unique_ptr<DIR, int (*)(DIR *)> files(opened, closedir);
+    while (const dirent *file = readdir(files.get())) {
+        const pid_t pid = client_of_socket(file->d_name);
+        struct stat about;
+        if (pid > 0 && kill(pid, 0) != 0 && errno == ESRCH &&
+            fstatat(self->directory, file->d_name, &about, AT_SYMLINK_NOFOLLOW) == 0 &&
+            S_ISSOCK(about.st_mode))
+            unlinkat(self->directory, file->d_name, 0);
+    }
+}
+
+// --- The socket
+
+static bool open_socket(listener *self, std::string *out_error) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    strlcpy(address.sun_path, self->path.c_str(), sizeof address.sun_path);
+    unlink(address.sun_path);
+    self->socket = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+    if (self->socket < 0)
+        return fail(out_error, "socket");
+    // The length that clients connect with may count less than the whole record; the path decides.
+    const mode_t before = umask(0177);
+    const int bound = bind(self->socket, reinterpret_cast<sockaddr *>(&address), sizeof address);
+    umask(before);
+    struct stat about;
+    if (bound != 0 || listen(self->socket, BACKLOG) != 0 || lstat(address.sun_path, &about) != 0)
+        return fail(out_error, self->path);
+    self->device = about.st_dev;
+    self->inode = about.st_ino;
+    return true;
+}
+
+static bool open_place(listener *self, std::string *out_error) {
+    if (!open_directory(self, &self->directory, out_error))
+        return false;
+    listener_tidy(self);
+    return open_socket(self, out_error);
+}
+
+static void close_place(listener *self) {
+    close_fd(&self->socket);
+    close_fd(&self->directory);
+}
+
+bool listener_open(listener *self, std::string *out_error) {
+    self->path = provider_path();
+    return take_lock_file(self, out_error) && open_place(self, out_error);
+}
+
+static bool is_in_place(const listener &self) {
+    struct stat about;
+    return self.socket >= 0 && lstat(self.path.c_str(), &about) == 0 && about.st_dev == self.device &&
+           about.st_ino == self.inode;
+}
+
+void listener_check(listener *self) {
+    if (is_in_place(*self))
+        return;
+    // The old ones are of no use: nobody can reach a socket without a name.
+    close_place(self);
+    std::string error;
+    if (open_place(self, &error)) {
+        self->say(self->path + " was removed, made again");
+        self->complaint.clear();
+        return;
+    }
+    close_place(self);
+    if (error != self->complaint)
+        self->say(self->path + " was removed and can't be made again: " + error);
+    self->complaint = error;
+}
+
+void listener_close(listener *self) {
+    if (is_in_place(*self))
+        unlink(self->path.c_str());
+    close_place(self);
+    close_fd(&self->lock);
+}
