@@ -6,6 +6,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include "mgmt/gcl_io.h"
@@ -87,6 +88,22 @@ static bool log_bad_ids(const gcl_session *session, int32_t uid, int32_t gid, ui
     return false;
 }
 
+// Anybody may make a socket where the provider's would be: only root's and our own user's are trusted. The
+// kernel knows whose process listens, whatever the greeting says.
+static bool listener_is_trusted(const gcl_session *session) {
+    ucred listener{};
+    socklen_t length = sizeof listener;
+    if (getsockopt(session->fd, SOL_SOCKET, SO_PEERCRED, &listener, &length) != 0) {
+        LC_LOG(LC_LOG_ERR, "getsockopt SO_PEERCRED: %m");
+        return false;
+    }
+    if (listener.uid == 0 || listener.uid == geteuid())
+        return true;
+    LC_LOG(LC_LOG_ERR, "session %d: proto admin: the provider is of user %d, not of root or our own",
+           session->id, static_cast<int>(listener.uid));
+    return false;
+}
+
 // A peer that gives no ids is taken for one of ours; one that gives them must own the socket that we reached
 // it by.
 static bool peer_is_trusted(const gcl_session *session, int32_t *inout_uid, int32_t *inout_gid) {
@@ -95,6 +112,8 @@ static bool peer_is_trusted(const gcl_session *session, int32_t *inout_uid, int3
         LC_LOG(LC_LOG_DEBUG, "session %d: unknown af: %d", session->id, session->family);
         return false;
     }
+    if (session->family == AF_UNIX && !listener_is_trusted(session))
+        return false;
     if (uid == -1 && gid == -1) {
         *inout_uid = static_cast<int32_t>(geteuid());
         *inout_gid = static_cast<int32_t>(getegid());

@@ -153,6 +153,17 @@ TEST_F(Gcl, ThePeersIdsAreChecked) {
         log.clear();
         drop();
     }
+    if (geteuid() != 0 || seteuid(1) != 0)
+        GTEST_SKIP() << "only one user is known here";
+    const int listening = listen(provider.listener, 8); // as user 1 from now on
+    ASSERT_EQ(seteuid(0) | listening, 0);
+    connect();
+    ASSERT_TRUE(provider.accept_client());
+    ASSERT_TRUE(provider.put(greeting_bytes(none, none)));
+    round();
+    EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
+    EXPECT_EQ(log.count("the provider is of user 1, not of root or our own"), 1);
+    drop();
 }
 
 TEST_F(Gcl, ARefusedServiceIsNoOpenService) {

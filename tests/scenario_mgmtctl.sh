@@ -184,6 +184,11 @@ complains "mgmtctl: $S/oper: wccpd-* did not answer in time"
 wait $walk && grep -q "^$G/weight = " "$LAB/walked" || fail "the walk waits for wccpd in vain"
 kill -CONT "$(lab_pid a1 wccpd)" "${LAB_PID[a1/wccpd]}"
 expect 0 '?*' get $S/oper
+if lab_in a1 chown 1 /tmp/gcl-socks/uds-provider-mgmtd; then # not where only one user is known
+    expect 3 '' get $S/oper
+    complains "mgmtctl: /tmp/gcl-socks/uds-provider-mgmtd belongs to user 1; *"
+    lab_in a1 chown 0 /tmp/gcl-socks/uds-provider-mgmtd
+fi
 lab_in a1 bash -c 'ls /tmp/gcl-socks | grep -c mgmtctl' >"$LAB/said"
 [ "$(cat "$LAB/said")" = 1 ] || fail "questions leave sockets behind" # the watch has one
 

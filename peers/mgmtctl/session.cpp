@@ -181,11 +181,14 @@ static const char *const OWNER_ONLY = "only root and the user that mgmtd runs as
 // What the library can't tell apart, and what it would leave behind for nobody.
 static bool somebody_listens(std::string *out_reason) {
     const std::string path = provider_path();
-    struct stat about;
+    struct stat about = {};
     if (stat(path.c_str(), &about) != 0 && (errno == ENOENT || errno == ENOTDIR))
         return fail(out_reason, "mgmtd is not running (nothing listens at " + path + ")");
     if (access(path.c_str(), W_OK) != 0 || access(GCL_SOCKET_DIRECTORY, W_OK) != 0)
         return fail(out_reason, path + ": " + strerror(errno) + "; " + OWNER_ONLY);
+    if (about.st_uid != 0 && about.st_uid != geteuid())
+        return fail(out_reason, path + " belongs to user " + std::to_string(about.st_uid) +
+                                    "; only root's mgmtd and our own user's are trusted");
     return true;
 }
 
