@@ -1,5 +1,6 @@
 // mgmtctl without mgmtd: what it shows, what it says of changes and of names that don't exist, and its
 // session with a provider made by hand.
+#include <algorithm>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -113,6 +114,7 @@ namespace {
 struct tree {
     std::vector<ctl_binding> nodes;
     int asked = 0;
+    size_t most = SIZE_MAX; // of nodes in an answer
     bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out) {
         asked++;
         node_name root;
@@ -127,6 +129,8 @@ struct tree {
                                             : child)
                 out->bindings.push_back(binding);
         }
+        if (out->bindings.size() > most)
+            *out = {LC_NO_BUFFER_SPACE, "ask for less", {}};
         return true;
     }
 };
@@ -198,6 +202,28 @@ TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
     ctl_reply reply;
     ASSERT_TRUE(add_appliances(std::ref(known), STATES + "/51/appliance", &reply.bindings));
     EXPECT_EQ(reply.bindings.size(), 3u) << "a walk from the list down has no count in it";
+}
+
+TEST(Walks, WhatIsLargerThanAMessageComesInPieces) {
+    tree known = sample();
+    const auto names = [&](const std::string &root, uint32_t code) {
+        node_name parsed;
+        ctl_reply reply;
+        EXPECT_TRUE(parse_node_name(root, &parsed));
+        EXPECT_TRUE(query_walk(std::ref(known), ctl_walk::subtree, parsed, &reply));
+        EXPECT_EQ(reply.code, code);
+        std::vector<std::string> out;
+        for (const ctl_binding &binding : reply.bindings)
+            out.push_back(binding.name);
+        std::sort(out.begin(), out.end());
+        return out;
+    };
+    const std::vector<std::string> all = names("/qv", LC_OK);
+    EXPECT_EQ(known.asked, 1);
+    for (known.most = 3; known.most < 9; known.most++)
+        EXPECT_EQ(names("/qv", LC_OK), all) << known.most;
+    known.most = 0;
+    EXPECT_TRUE(names("/qv", LC_NO_BUFFER_SPACE).empty());
 }
 
 // --- The session

@@ -86,7 +86,9 @@ int ctl_walk_nodes(const ctl_options &options, const std::string &name, ctl_walk
     for (const std::string &root :
          name == "/" ? std::vector<std::string>{"/logging", "/qv"} : std::vector<std::string>{name}) {
         ctl_reply reply;
-        if (!mgmtd.ask(how, root, &reply))
+        node_name parsed;
+        if (parse_node_name(root, &parsed) ? !query_walk(mgmtd.asking(), how, parsed, &reply)
+                                           : !mgmtd.ask(how, root, &reply))
             return mgmtd.lost();
         if (reply.code != 0)
             return tell_failure(options, {exit_of(reply.code), root, reply.message, "", reply.code});

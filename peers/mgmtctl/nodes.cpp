@@ -57,7 +57,9 @@ static const std::vector<node_name> &patterns() {
     return all;
 }
 
-std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above) {
+// The parts that can follow a name: fixed ones of the schema and of the states, and those that there are
+// where the name's next part is somebody's choice. Sorted.
+static std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above) {
     std::set<std::string> found;
     const size_t depth = above.parts.size();
     bool choice = false;
@@ -125,13 +127,19 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
     return "";
 }
 
+static bool is_state(const node_name &name) {
+    for (const char *root : {NODE_WCCPD_STATE, NODE_GROUP_STATE, NODE_ALARM_STATE})
+        if (name == named(root) || name.is_under(named(root)))
+            return true;
+    return false;
+}
+
 std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &text) {
     node_name name;
     if (parse_node_name(text, &name) && find_schema_row(name))
         return "";
-    for (const char *root : {NODE_WCCPD_STATE, NODE_GROUP_STATE, NODE_ALARM_STATE})
-        if (name == named(root) || name.is_under(named(root)))
-            return "it is a state: it can only be read";
+    if (is_state(name))
+        return "it is a state: it can only be read";
     return hint_for_missing(ask, text);
 }
 
@@ -168,7 +176,33 @@ std::vector<std::string> completions(const ctl_ask &ask, const std::string &word
     return out;
 }
 
-// --- Appliances of a walk
+// --- Walks
+
+bool query_walk(const ctl_ask &ask, ctl_walk how, const node_name &root, ctl_reply *out) {
+    ctl_reply whole;
+    if (!ask(how, root.text(), out))
+        return false;
+    const std::vector<std::string> parts =
+        out->code == LC_NO_BUFFER_SPACE ? names_below(ask, root) : std::vector<std::string>{};
+    if (parts.empty())
+        return true;
+    if (how == ctl_walk::subtree && !ask(ctl_walk::node, root.text(), &whole))
+        return false;
+    for (const std::string &part : parts) {
+        ctl_reply piece;
+        if (!query_walk(ask, how, root.below(part), &piece))
+            return false;
+        if ((piece.code == LC_IO_CLOSED || piece.code == LC_IO_TIMED_OUT) && !is_state(root))
+            continue; // a walk from above the states goes without them
+        if (piece.code != LC_OK) {
+            *out = piece;
+            return true;
+        }
+        whole.bindings.insert(whole.bindings.end(), piece.bindings.begin(), piece.bindings.end());
+    }
+    *out = std::move(whole);
+    return true;
+}
 
 bool query_appliances(const ctl_ask &ask, const std::string &list, unsigned long count,
                       std::vector<ctl_binding> *inout) {

@@ -13,9 +13,6 @@
 // A query of the session, so that a test can answer it. False: no answer.
 using ctl_ask = std::function<bool(ctl_walk walk, const std::string &name, ctl_reply *out)>;
 
-// The parts that can follow a name: fixed ones of the schema and of the states, and those that there are
-// where the name's next part is somebody's choice. Sorted.
-std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above);
 // What to say to somebody who asked for a node that doesn't exist, or wanted to change one that can't be. May
 // be empty.
 std::string hint_for_missing(const ctl_ask &ask, const std::string &name);
@@ -23,6 +20,9 @@ std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &name);
 // Words that could stand in the place of a beginning: node names up to their next part, or NAME=VALUE.
 std::vector<std::string> completions(const ctl_ask &ask, const std::string &word);
 
+// A walk. One whose answer is larger than a message is asked for again in pieces, each below one of the next
+// parts of the name: group by group in the end. False: no answer.
+bool query_walk(const ctl_ask &ask, ctl_walk how, const node_name &root, ctl_reply *out);
 // wccpd answers for the appliances of a group by number only: the nodes "ipaddr" and "weight" of the first
 // `count` below `list` (".../51/appliance"), in their order, are appended to `inout`. False: no answer.
 constexpr unsigned long APPLIANCES_MAX = 32; // of a group
