@@ -75,7 +75,8 @@ void table(benchmark::State &state, uint32_t method) {
     wccp_service_group *group = group_with_appliances(shared, method);
     std::vector<wccp_view_appliance> appliances(WCCP_MAX_APPLIANCES);
     for (uint32_t i = 0; i < WCCP_MAX_APPLIANCES; i++)
-        appliances[i] = {nullptr, nullptr, host(i * 7 % 32 + 1), static_cast<uint16_t>(i * 13 + 1), 1};
+        appliances[i] = {nullptr, nullptr,           host(i * 7 % 32 + 1), static_cast<uint16_t>(i * 13 + 1),
+                         1,       WCCP_LISTED_BY_ALL};
     const auto add = [&](uint32_t count) {
         wccp_designated_appliance_assignment_start(group);
         for (uint32_t i = 0; i < count; i++)
