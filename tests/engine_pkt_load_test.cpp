@@ -10,6 +10,7 @@
 
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_wire.h"
+#include "tests/support/log_lines.h"
 #include "tests/support/wire_bytes.h"
 
 namespace {
@@ -138,6 +139,7 @@ TEST_F(Load, CapabilitiesAreWhatDiffersFromTheDefaults) {
         {1, 1, 2, "0008 0008 0003 0004 00000002"},
         {2, 1, 2, "0008 0010 0001 0004 00000002 0003 0004 00000002"},
     };
+    log_lines log;
     for (const auto &row : rows) {
         clear();
         group->fwd_method = row.fwd;
@@ -145,6 +147,8 @@ TEST_F(Load, CapabilitiesAreWhatDiffersFromTheDefaults) {
         group->ret_method = row.ret;
         EXPECT_EQ(wccp_pkt_load_capability_info_component(group.get(), pkt.get()), 0);
         EXPECT_EQ(loaded(), wire_bytes().hex(row.expected).bytes);
+        EXPECT_EQ(log.say("WCCP: GRP 50 loading capability comp. all capabilities are default."),
+                  !*row.expected);
     }
 }
 
@@ -200,6 +204,10 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
         {1, 0, 1, 1, 1, 1, 1, 1},    {1, 1, 0, 0, 1, 1, 1, 1},
         {1, 1, 33, 129, 1, 1, 1, 1}, {1, 1, 1, 1, 0, 0, 1, 1}, // the view is asked of the mask form alone
     };
+    log_lines log;
+    const auto text = [](uint32_t number) { return std::to_string(number); };
+    group->bucket_count = 7;
+    group->dsg_appliances[0].assigned = 4;
     for (const auto &row : rows) {
         group->designated = row.designated;
         group->sending_router_count = row.routers;
@@ -207,6 +215,17 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
         group->mask_value_count = row.values;
         group->appliance_view_count = row.appliances;
         const int expected[] = {row.by_neither, row.by_hash, row.by_mask, row.by_neither};
+        const std::string state = "invalid designated appliance state. designated " + text(row.designated) +
+                                  " # routers " + text(row.routers);
+        const std::string neither =
+            "WCCP: redirect assign: groups actual assignment method is not set. failed.";
+        const std::string refused[] = {neither,
+                                       "WCCP GRP 50: redirect assignment load: " + state +
+                                           " # active appliances " + text(row.active) + "\n",
+                                       "WCCP GRP 50: TX MASK redirect assign: " + state + " appliances " +
+                                           text(row.appliances) + " values: " + text(row.values) + "\n",
+                                       neither};
+        const std::string names[] = {"", "HASH", "MASK", ""};
         for (uint32_t method = 0; method < 4; method++) {
             clear();
             group->assign_method = method;
@@ -214,7 +233,19 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
             EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), expected[method]);
             EXPECT_EQ(routers[0].assign_tx_count, sent + (expected[method] ? 0 : 1));
             EXPECT_EQ(pkt->length == 44, expected[method] == 1) << "where it stopped";
+            EXPECT_TRUE(log.say(expected[method] ? refused[method]
+                                                 : "WCCP GRP 50: TX " + names[method] +
+                                                       " redirect assign: not all buckets are assigned. "
+                                                       "assigned: 4 total: 7\n"));
         }
+    }
+    group->bucket_count = 4; // each has its appliance
+    for (const uint32_t method : {1, 2}) {
+        clear();
+        group->assign_method = method;
+        group->appliance_view_count = 1;
+        EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+        EXPECT_EQ(log.take(), "");
     }
 }
 
@@ -245,6 +276,7 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
             sum += row.sizes[i];
             starts.insert(starts.end(), {4096 - sum, 4096 - sum + 1});
         }
+        log_lines log;
         for (const uint32_t start : starts) {
             clear();
             pkt->length = pkt->offset = start;
@@ -255,6 +287,9 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
             EXPECT_EQ(row.build(group.get(), pkt.get()), fitting == row.sizes.size() ? 0 : 1) << start;
             EXPECT_TRUE(pkt->length == end && pkt->offset == end) << start;
             EXPECT_EQ(std::count(pkt->data + end, pkt->data + 4096, 0), 4096 - end) << start;
+            EXPECT_EQ(log.say("WCCP GRP 50: TX MASK redirect assign: component: (len 2472) does not fit in "
+                              "the pkt."),
+                      row.sizes.size() == 4 && row.assign_method == 2 && fitting == 3);
         }
     }
 }
@@ -267,12 +302,22 @@ TEST_F(Load, AViewThatIsTooLargeOrMiscountedIsRefused) {
     EXPECT_EQ(pkt->length, 4096u);
     clear();
     EXPECT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 1);
-    for (uint32_t *count : {&group->sending_router_count, &group->appliance_view_count}) {
+    log_lines log;
+    const struct {
+        uint32_t *count;
+        const char *line;
+    } lists[] = {
+        {&group->sending_router_count, "WCCP router count (31) mismatch with entries in router view list"},
+        {&group->appliance_view_count,
+         "WCCP web cache count (954) mismatch with entries in appliance view list"},
+    };
+    for (const auto &list : lists) {
         clear();
-        --*count;
+        --*list.count;
         EXPECT_EQ(wccp_pkt_load_web_cache_view_info_component(group.get(), pkt.get()), 1);
         EXPECT_EQ(pkt->length, 0u);
-        ++*count;
+        EXPECT_TRUE(log.say(list.line));
+        ++*list.count;
     }
 }
 

@@ -37,8 +37,9 @@ struct element {
     uint32_t id, weight, bucket_byte;
 };
 // A view of one router, with hash elements. Each bucket byte stands 32 times.
-wire_bytes view(uint32_t router, const std::vector<element> &elements, uint32_t key_change = 0) {
-    wire_bytes out = hex("0004 0000 c1c2c3c4 0a000064").u32(key_change).u32(1).ip(0, router);
+wire_bytes view(uint32_t router, const std::vector<element> &elements, uint32_t key_change = 0,
+                uint32_t key_address = 100) {
+    wire_bytes out = hex("0004 0000 c1c2c3c4").ip(0, key_address).u32(key_change).u32(1).ip(0, router);
     out.u32(static_cast<uint32_t>(elements.size()));
     for (const element &each : elements) {
         out.ip(0, each.id).u32(0).fill(32, static_cast<uint8_t>(each.bucket_byte));
@@ -182,11 +183,13 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         EXPECT_EQ(lines.find("WCCP processing received packet from 10.0.0.1 failed") != std::string::npos,
                   row.result == 1);
     }
-    group->admin_state = WCCP_ADMIN_DOWN;
     const counters before = now();
-    EXPECT_EQ(process(good), 0);
-    EXPECT_NE(log.take().find("WCCP GRP 51: is disabled. dropping the rxed packet."), std::string::npos);
-    EXPECT_EQ(now(), before);
+    for (const uint32_t state : {0u, WCCP_ADMIN_DOWN + 0u}) {
+        group->admin_state = state;
+        EXPECT_EQ(process(good), 0);
+        EXPECT_TRUE(log.say("WCCP GRP 51: is disabled. dropping the rxed packet."));
+        EXPECT_EQ(now(), before);
+    }
     group->admin_state = WCCP_ADMIN_UP;
     EXPECT_EQ(process(good), 0);
     EXPECT_NE(router(1), nullptr) << "what was refused above stood for something that passes";
@@ -350,7 +353,9 @@ TEST_F(Messages, AMapOfAFullPacketIsTakenWhole) {
 }
 
 TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
-    const auto report = [](uint32_t id, uint32_t key) { process(icu(id, view(id, {{100, 100, 0}}, key))); };
+    const auto report = [](uint32_t id, uint32_t key, uint32_t address = 100) {
+        process(icu(id, view(id, {{100, 100, 0}}, key, address)));
+    };
     report(1, 0);
     report(2, 0);
     pass_seconds(1);
@@ -362,15 +367,16 @@ TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
         uint32_t key;
         bool acked;
         uint8_t pending, timer;
+        uint32_t key_address = 100;
     } steps[] = {
         {15, 1, 1, key, false, 2, 1}, // sent before the assignment could have arrived
-        {10, 2, 1, key - 1, false, 2, 1}, {0, 2, 1, key, true, 1, 1},
-        {0, 2, 1, key, true, 1, 1}, // one router acknowledges once
+        {10, 2, 1, key - 1, false, 2, 1}, {0, 2, 1, key, false, 2, 1, 101}, // another appliance's key
+        {0, 2, 1, key, true, 1, 1},       {0, 2, 1, key, true, 1, 1},       // one router acknowledges once
         {0, 2, 2, key, true, 0, 0},
     };
     for (const auto &step : steps) {
         pass_seconds(step.seconds);
-        report(step.router, step.key);
+        report(step.router, step.key, step.key_address);
         EXPECT_EQ(group->tx_redirect_assign, step.assignments);
         EXPECT_EQ(!(router(step.router)->flags & WCCP_RTR_ASSIGN_UNACKED), step.acked);
         EXPECT_TRUE(group->pending_acks == step.pending && group->assign_timer.active == step.timer);
@@ -436,6 +442,9 @@ TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
                   row.counted);
     }
     engine.interface->ready_flags = WCCP_ALL_READY;
+    group->tx_pkt->ipa = {{255, 255, 255, 255}}; // which the kernel refuses: only a result of 0 is a failure
+    EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, 25), 0);
+    EXPECT_EQ(group->tx_removal_replies, 1u);
     EXPECT_EQ(wccp_transmit_packet(group, nullptr, 10), 1);
     EXPECT_EQ(group->tx_failures, 3u);
     EXPECT_EQ(engine.sent_to("10.0.0.1"), bytes{});
