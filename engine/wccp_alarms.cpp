@@ -1,10 +1,10 @@
 // Alarms of a service group: the adjacency alarm, for routers that aren't fully connected, and the assignment
 // alarm, for a table that the routers don't carry out as it was meant.
 //
-// A bit in raised_alarms tells whether an alarm stands. Each has a check on a one-shot timer, armed by
-// whatever gave a reason to look: the check comes 60 seconds after the first reason, and later reasons don't
-// push it back unless they say so. Nothing arms it again once it has run, so a quiet group keeps what it has.
-// A router that goes, or stops listing this appliance, raises the adjacency alarm at once.
+// A bit in raised_alarms shows that an alarm is active. Each alarm has a check on a one-shot timer: it runs
+// 60 seconds after the first reason to check, and later reasons don't delay it unless they ask for that.
+// Nothing starts the timer again once the check has run, so a quiet group keeps its alarms as they are. A
+// router that is removed, or that stops listing this appliance, raises the adjacency alarm at once.
 //
 // The callers hold the engine lock, on the timer thread, a receive thread or the main thread; it guards the
 // bits, the timers and the text of the message. Messages go straight out on the alarm session and nothing

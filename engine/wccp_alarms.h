@@ -6,8 +6,8 @@
 
 struct gcl_session;
 extern gcl_session *qv_alm_mgmt_session; // null before it exists and after qv_alm_mgmt_deinit
-// Guards the session against its end while somebody sends: behind the engine lock, ahead of the session's own
-// locks.
+// Keeps the session from ending while a thread sends on it. Taken after the engine lock and before the
+// session's own locks.
 extern pthread_mutex_t qv_alm_session_mutex;
 
 // Lock held.

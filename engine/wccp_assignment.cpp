@@ -110,7 +110,7 @@ static void compute_table(wccp_service_group *group) {
                                       group->bucket_ipa, 0);
 }
 
-// Moves the active entries forward, in their order, and zeroes what is left behind them.
+// Moves the active entries forward, in their order, and zeroes the places after them.
 static uint32_t close_gaps(wccp_service_group *group) {
     uint32_t kept = 0;
     for (uint32_t i = 0; i < group->dsg_appliance_count; i++)

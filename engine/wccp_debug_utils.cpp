@@ -37,7 +37,7 @@ static void put_swapped_words(wccp_piece *piece, const uint32_t *words) {
 using group_row = wccp_dump_row<wccp_service_group>;
 using router_row = wccp_dump_row<wccp_sending_router>;
 
-// A row whose value is one counter or number of the record, as it stands.
+// A row whose value is one counter or number of the record.
 #define NUMBER_ROW(record, label, format, field)                                                             \
     {                                                                                                        \
         label, [](wccp_piece *p, const record *r) { wccp_piece_add(p, format, r->field); }                   \

@@ -1,14 +1,14 @@
 // The writer's side of the wire format.
 //
 // Messages are written into a wccp_pkt of the group, or of a removal reply, under the engine lock, on the
-// timer thread or whichever thread holds it. The buffer is all zero before the first load, and a load only
-// writes what isn't. place<T>() is the way into it: it gives the component's place if all of it fits below
-// 4096 bytes, and moves nothing; advance() comes once the component is whole. So a load that refuses leaves
-// the packet as it was, and its builder abandons the message.
+// timer thread or whichever thread holds it. The buffer is all zero before the first load, and a load writes
+// only what isn't zero. The only way into it is place<T>(), which gives a component's place if all of it fits
+// into 4096 bytes, and moves nothing; advance() is called once the component is complete. A load that fails
+// therefore leaves the packet as it was, and its builder gives the message up.
 //
-// What goes to the wire is the group's state of this moment, nothing is remembered from one message to the
-// next, but for one count: each Redirect-Assign that names a router counts in its `assign_tx_count`, which
-// tells the reader of acknowledgements how often it has been asked.
+// A message carries the group's present state, and nothing is remembered from one message to the next except
+// one count: each Redirect-Assign that names a router adds 1 to its `assign_tx_count`, from which the test of
+// acknowledgements knows how many have been sent.
 #include "engine/wccp_pkt_load.h"
 
 #include <cstring>
@@ -138,7 +138,7 @@ int wccp_pkt_load_web_cache_view_info_component(wccp_service_group *group, wccp_
 
 // What the two forms of the assignment have in common.
 
-// Writes the router elements and gives the place behind them.
+// Writes the router elements and returns the place after them.
 static uint8_t *write_assigned_routers(const wccp_service_group *group, void *elements) {
     auto *const first = static_cast<wccp_wire_assign_router_element *>(elements);
     auto *element = first;

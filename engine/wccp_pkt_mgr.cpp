@@ -1,21 +1,21 @@
 // The message loop in both directions: one received packet from its header to the views, and the three kinds
 // of packet that this appliance sends.
 //
-// Reception runs on the receive thread of the interface, whose stack holds the packet; transmission on the
-// timer thread or on whichever thread stops a group. Both hold the engine lock throughout, which is all that
-// the group's one transmit packet needs. A packet is written afresh for every Here-I-Am and Redirect-Assign;
-// a removal reply was finished when its query came and goes out unchanged each time.
+// Reception runs on the receive thread of the interface, whose stack holds the packet. Transmission runs on
+// the timer thread, or on whichever thread stops a group. Both hold the engine lock throughout, so the
+// group's one transmit packet needs no other protection. A packet is built anew for every Here-I-Am and
+// Redirect-Assign; a removal reply is built when its query comes and is sent unchanged each time.
 //
-// Anybody can send to the port. A packet is measured, then matched with a group and its security, then read,
-// and only a whole I-See-You with a router that may join gets as far as the group's records: up to the point
-// where the router is updated, nothing but counters has changed. What comes behind it is not rolled back when
-// a later step refuses.
+// Anybody can send to the port. A packet's length is checked, then its group and security, then its contents.
+// Only a complete I-See-You of a router that may join reaches the group's records: until the router's record
+// is updated, nothing but counters changes. What has been updated is not rolled back when a later step fails.
 //
-// Two tables tell what messages consist of: the optional components of an I-See-You with their readers, and
-// the build steps of what is sent with their loaders. Each step that fails is logged by its words.
+// Two tables list what messages consist of: the optional components of an I-See-You with their readers, and
+// the build steps of the messages that are sent with their loaders. A step that fails is logged with its
+// words.
 //
-// An acknowledgement counts from the second Redirect-Assign on: a router that already carries the key after
-// the first has it from an I-See-You that crossed with it, not from the message.
+// An acknowledgement counts from the second Redirect-Assign on: when a router reports the key after the first
+// one, its I-See-You may have crossed with the message.
 #include "engine/wccp_pkt_mgr.h"
 
 #include <cstring>

@@ -199,7 +199,8 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
         return 1;
     }
     const uint32_t elements_at = static_cast<uint32_t>(sizeof *view + (routers + 1) * sizeof(be32));
-    // A count that was cut off stands for no appliances; the view then doesn't fit for want of the count.
+    // Where the count was cut off there are no appliances; the view then doesn't fit, because the count
+    // doesn't.
     const auto *count = look<be32>(pkt, elements_at - sizeof(be32));
     const uint32_t appliances = count ? to_host(*count) : 0;
     if (appliances > WCCP_MAX_APPLIANCES) {

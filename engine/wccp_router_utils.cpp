@@ -2,7 +2,7 @@
 //
 // A record is made from a router's first I-See-You, once its capabilities have been found to agree, and lives
 // until the router has been silent for 40 seconds or the group stops. The first router decides the group's
-// forwarding, assignment and return methods for all that follow; they stand until the last router has gone.
+// forwarding, assignment and return methods for all that follow; they hold until the last router is removed.
 // The records belong to the group's list, and so do the replies to Removal Queries, each a finished message
 // with the number of times that it still has to be sent. Their number is bounded for each router; a query
 // beyond it is refused.
@@ -10,10 +10,10 @@
 // The engine lock is held throughout: by a receive thread for creation, decision and queries, by the timer
 // thread for the sweep and the replies. Nothing here reads a message or changes a view of its own accord.
 //
-// A thread can be cancelled while it waits for tunneld with a record in its hands. A new record is owned by
-// the scope until it stands in the list with its tunnel reference noted, and wccp_add_tunnel can't be
-// cancelled between the two. A record that goes is owned by the scope from the moment it leaves the list:
-// however the wait for its tunnel ends, it is freed and the count falls with it.
+// A thread can be cancelled while it waits for tunneld and owns a record. A new record is owned by the scope
+// until it is in the list with its tunnel reference, and wccp_add_tunnel can't be cancelled between the two.
+// A record that is removed is owned by the scope from the moment it leaves the list: however the wait for its
+// tunnel ends, it is freed and the count goes down.
 #include "engine/wccp_router_utils.h"
 
 #include "engine/wccp_alarms.h"
@@ -53,7 +53,7 @@ namespace {
 
 using capabilities = wccp_rtr_capabilities;
 
-// One of the three methods to agree on: where it stands, which code wins when both sides can do either, and
+// One of the three methods to agree on: its member, which code wins when both sides can do either, and
 // what is said and returned when they have none in common.
 struct capability_step {
     uint32_t capabilities::*word;

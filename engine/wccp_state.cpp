@@ -2,17 +2,17 @@
 // (INIT, ACTIVE, BACKUP) with its role.
 //
 // Once a second the timer thread calls wccp_process_timers for each enabled group, under the engine lock that
-// it holds for the whole tick; the only clock is that tick. What a tick does, and in which order, is the
-// table of steps below. A step that fails is logged and the next one runs: a message that could not be sent
-// goes again after its period, and an election that selected nobody waits for the next change of a view.
+// it holds for the whole tick; the only clock is that tick. The table of steps below lists what a tick does,
+// in order. A step that fails is logged and the next one runs: a message that could not be sent is sent again
+// after its period, and an election that selected no appliance waits for the next change of a view.
 //
 // The election exchanges nothing. Each appliance applies the same rule to the same view: the lowest address
-// is designated, provided that every router that anybody reports is heard from both ways. Being designated
-// and being ACTIVE have nothing to do with each other.
+// is designated, provided that every router that any router reports is two-way connected. An appliance may be
+// designated without being ACTIVE, and the other way round.
 //
-// The state functions run on the tick or on a receive thread. Each entry into a state tells the role to the
-// policy groups and sends a state event, also when the role is the same as before; once the exit has begun
-// the role still changes, but nobody is told.
+// The state functions run on the tick or on a receive thread. Each entry into a state passes the role on to
+// the policy groups and sends a state event, even when the role is the same as before. Once the exit has
+// begun the role still changes, but no event is sent.
 #include "engine/wccp_state.h"
 
 #include <cstdio>

@@ -1,6 +1,6 @@
 // WCCP version 2 on the wire, once: every message and component layout, for the writer and the reader alike.
 // All fields are big-endian and alignment is 1. A component starts with a 16-bit type and a 16-bit length
-// that counts the bytes behind those four.
+// that counts the bytes after those four.
 #pragma once
 
 #include <cstddef>
@@ -38,7 +38,7 @@ constexpr uint16_t WCCP_COMMAND_SHUTDOWN = 1;
 struct wccp_wire_msg_header {
     be32 type;
     be16 version;
-    be16 length; // bytes of the message behind this field
+    be16 length; // bytes of the message after this field
 };
 struct wccp_wire_component {
     be16 type;
@@ -147,7 +147,7 @@ struct wccp_wire_router_view { // r addresses, a count, w web-cache elements fol
     be32 key_change;
     be32 routers;
 };
-// A web-cache element of a router view: flags tell which of the three it is.
+// A web-cache element of a router view. Its flags decide which of the three it is.
 struct wccp_wire_view_element {
     be32 web_cache_id;
     be16 hash_revision;
