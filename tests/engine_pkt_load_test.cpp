@@ -249,7 +249,7 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
     }
 }
 
-// The largest messages fit. Begun so far behind that a component just fits, or lacks a byte: it goes to the
+// The largest messages fit. Begun so late that a component just fits, or lacks a byte: it goes to the
 // last byte of the packet and not one byte further, and what doesn't fit leaves the packet as it was.
 TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
     group->security_option = 1;
@@ -296,7 +296,7 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
 
 TEST_F(Load, AViewThatIsTooLargeOrMiscountedIsRefused) {
     add_routers(32);
-    add_appliances(955); // 16 + 256 + 3820 bytes, behind 4
+    add_appliances(955); // 16 + 256 + 3820 bytes, after 4
     pkt->length = pkt->offset = 4;
     EXPECT_EQ(wccp_pkt_load_web_cache_view_info_component(group.get(), pkt.get()), 0);
     EXPECT_EQ(pkt->length, 4096u);

@@ -36,7 +36,7 @@ wire_bytes identity(uint32_t router, uint32_t receive_id = 0xa1a2a3a4) {
 struct element {
     uint32_t id, weight, bucket_byte;
 };
-// A view of one router, with hash elements. Each bucket byte stands 32 times.
+// A view of one router, with hash elements. Each bucket byte is repeated 32 times.
 wire_bytes view(uint32_t router, const std::vector<element> &elements, uint32_t key_change = 0,
                 uint32_t key_address = 100) {
     wire_bytes out = hex("0004 0000 c1c2c3c4").ip(0, key_address).u32(key_change).u32(1).ip(0, router);

@@ -1,5 +1,5 @@
 // What the engine accepts of received messages and what it refuses, over bytes written by hand. Under the
-// address sanitizer whatever lies behind the received bytes can't be touched.
+// address sanitizer nothing after the received bytes can be touched.
 
 #include "engine/wccp_pkt_unload.h"
 
@@ -49,7 +49,7 @@ const wire_bytes hash_element = hex("0a000001 0000 0000 11*32 0064 0000");
 const wire_bytes mask_element = hex("0a000002 0000 0002 22*20 0064 0000"); // that redirects, in Nexus mode
 const wire_bytes idle_element = hex("0a000003 0000 0003 22*20 0064 0000");
 const wire_bytes short_element = hex("0a000004 0000 0002 33*4 0064 0000"); // that redirects, in IOS mode
-// Counts as told, and what is there.
+// The counts as they are declared, then what is there.
 wire_bytes view(uint32_t routers = 0, uint32_t addresses = 0, uint32_t appliances = 0,
                 const std::vector<wire_bytes> &elements = {}, uint32_t type = 4, int length_error = 0) {
     wire_bytes out = wire_bytes().u16(type).hex("0000 c1c2c3c4 0a000064 0a0b0c0d").u32(routers);
