@@ -52,6 +52,28 @@ uint32_t list_length(Entry *const *head) {
     return length;
 }
 
+// A reference count is the number of routers that report an address, and no router reports one twice.
+template <typename UnionEntry, typename Entry, size_t Size>
+void check_references(const wccp_service_group *group, const UnionEntry *first,
+                      uint32_t wccp_sending_router::*count, Entry (wccp_sending_router::*entries)[Size]) {
+    uint32_t references = 0, reported = 0;
+    for (const UnionEntry *entry = first; entry; entry = entry->next) {
+        uint32_t routers = 0;
+        for (const wccp_sending_router *router = group->sending_routers; router; router = router->next) {
+            const Entry *begin = router->*entries, *end = begin + router->*count;
+            const auto found =
+                std::count_if(begin, end, [entry](const Entry &each) { return each.ipa == entry->ipa; });
+            REQUIRE(found <= 1);
+            routers += found == 1;
+        }
+        REQUIRE(entry->ref_count != 0 && entry->ref_count == routers);
+        references += entry->ref_count;
+    }
+    for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
+        reported += router->*count;
+    REQUIRE(reported == references);
+}
+
 void check_group(const wccp_service_group *group) {
     REQUIRE(list_length(&group->sending_routers) == group->sending_router_count);
     REQUIRE(list_length(&group->appliance_view) == group->appliance_view_count);
@@ -75,27 +97,10 @@ void check_group(const wccp_service_group *group) {
         const uint32_t both = WCCP_RTR_ONE_WAY | WCCP_RTR_TWO_WAY;
         REQUIRE((router->flags & both) != both && (router->flags & both) != 0);
     }
-    // Each mention in a router's report is one reference. An update that failed half-way may leave more.
-    const auto mentions = [group](be32 ipa, auto count, auto entries) {
-        uint32_t sum = 0;
-        for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
-            for (uint32_t i = 0; i < router->*count; i++)
-                sum += (router->*entries)[i].ipa == ipa;
-        return sum;
-    };
-    uint32_t reported = 0, references = 0;
-    for (const wccp_view_router *entry = group->router_view; entry; entry = entry->next) {
-        REQUIRE(entry->ref_count == mentions(entry->ipa, &wccp_sending_router::view_router_count,
-                                             &wccp_sending_router::view_routers));
-        references += entry->ref_count;
-    }
-    for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
-        reported += router->view_router_count;
-    REQUIRE(reported == references);
-    for (const wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next)
-        REQUIRE(entry->ref_count != 0 &&
-                entry->ref_count >= mentions(entry->ipa, &wccp_sending_router::view_appliance_count,
-                                             &wccp_sending_router::view_appliances));
+    check_references(group, group->router_view, &wccp_sending_router::view_router_count,
+                     &wccp_sending_router::view_routers);
+    check_references(group, group->appliance_view, &wccp_sending_router::view_appliance_count,
+                     &wccp_sending_router::view_appliances);
 }
 
 void mend(const wccp_service_group *group, wccp_pkt *pkt) {
