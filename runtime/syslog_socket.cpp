@@ -38,7 +38,6 @@ constexpr const char *LOG_PATH = "/dev/log";
 constexpr size_t LINE_BYTES = 4096;
 constexpr int64_t WAIT_STEP_NS = 500000;
 constexpr int64_t LEAST_STEP_NS = 1000; // a wait that finds room each time and no place in it ends as well
-constexpr int64_t SECOND_NS = 1000000000;
 
 // The C library's own mask stands behind a lock which another thread's blocked syslog call may hold.
 static std::atomic<int32_t> mask{0xff};
