@@ -8,10 +8,11 @@
 // thread, so that nobody holds those locks while waiting for the loop's. No callback here ever takes the
 // engine lock.
 //
-// The start waits for the alarm thread, which waits for mgmtd. The main thread is not deaf meanwhile: it
+// The start waits for the alarm thread, which waits for mgmtd. The main thread keeps reacting meanwhile: it
 // waits in rounds of its own loop, and the alarm thread's last step of the start wakes it. An exit that
-// begins in such a round ends both waits, the opening by `qv_exiting`. The alarm thread makes its loop under
-// a mutex and looks at `qv_exiting` there, so that whoever ends it either finds the loop or is seen.
+// begins in such a round ends both waits, the opening by `qv_exiting`. The alarm thread creates its loop
+// under a mutex and checks `qv_exiting` there, so that whoever ends it either finds the loop or is seen.
+// Senders get the session once it is open; what they have to say before that fails.
 //
 // qv_initiate_exit comes from the main thread at exit, and from the alarm thread itself when the session is
 // lost; the thread does not join itself. A lost alarm session ends this client only: the daemon ends through
@@ -31,6 +32,7 @@
 #include "runtime/logging.h"
 
 static lew *qv_alm_lwc;
+static gcl_session *session; // while it opens the alarm thread's alone
 static mdc *qv_alm_mcc;
 static std::atomic<int32_t> qv_exiting;
 static gcl *qv_alm_instance;
@@ -40,7 +42,7 @@ static int32_t qv_response_expected;
 static int32_t qv_expected_request_id;
 static bn_response_msg *qv_captured_response;
 static mgmt_client qv_alm_client = {&qv_alm_lwc,
-                                    &qv_alm_mgmt_session,
+                                    &session,
                                     &qv_alm_mcc,
                                     &qv_response_expected,
                                     &qv_expected_request_id,
@@ -114,6 +116,8 @@ static lc_status start_session(const char *client_name) {
     CHECK_STATUS(bn_set_global_callback_event_response_msg(qv_alm_instance, qv_alm_mgmt_handle_event_response,
                                                            nullptr));
     CHECK_STATUS(qv_alm_mgmt_open_session(client_name));
+    const mutex_guard guard(&qv_alm_session_mutex);
+    qv_alm_mgmt_session = session;
     return LC_OK;
 }
 
@@ -215,6 +219,7 @@ lc_status qv_initiate_exit() {
 lc_status qv_alm_mgmt_deinit() {
     const cancel_off_guard uncancelled;
     const mutex_guard guard(&qv_alm_session_mutex);
+    qv_alm_mgmt_session = nullptr;
     mgmt_client_deinit(&qv_alm_client);
     LOG_STATUS(lew_deinit(&qv_alm_lwc));
     return LC_OK;

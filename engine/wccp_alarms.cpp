@@ -20,7 +20,7 @@
 #include "platform/qvcommon_transport.h"
 #include "runtime/guards.h"
 
-gcl_session *qv_alm_mgmt_session;
+std::atomic<gcl_session *> qv_alm_mgmt_session;
 pthread_mutex_t qv_alm_session_mutex = PTHREAD_MUTEX_INITIALIZER;
 
 static constexpr uint32_t CHECK_DELAY = 60; // seconds

@@ -1,13 +1,16 @@
 // Alarms of a service group, and the client session on which alarms and state events go.
 #pragma once
 
+#include <atomic>
+
 #include "engine/wccp_records.h"
 #include "runtime/common.h"
 
 struct gcl_session;
-extern gcl_session *qv_alm_mgmt_session; // null before it exists and after qv_alm_mgmt_deinit
-// Keeps the session from ending while a thread sends on it. Taken after the engine lock and before the
-// session's own locks.
+// Null before it is open and after qv_alm_mgmt_deinit. Changes under the mutex below, which also guards the
+// session against its end while somebody sends; taken after the engine lock and before the session's own
+// locks.
+extern std::atomic<gcl_session *> qv_alm_mgmt_session;
 extern pthread_mutex_t qv_alm_session_mutex;
 
 // Lock held.
