@@ -314,9 +314,10 @@ TEST_F(Config, ADeletedGroupSaysFarewellUnlessItIsInInit) {
 }
 
 TEST_F(Config, StoppingAllLeavesTheDisabledAlone) {
-    wccp_service_group *up = add(config(1)), *down = add(config(2));
+    wccp_service_group *up = add(config(1)), *down = add(config(2)), *unset = add(config(3));
     down->admin_state = WCCP_ADMIN_DOWN;
-    up->change_number = down->change_number = 3;
+    unset->admin_state = 0;
+    up->change_number = down->change_number = unset->change_number = 3;
     EXPECT_EQ(wccp_stop_all_service_groups(), 0);
     EXPECT_EQ(up->change_number, 0u);
     EXPECT_EQ(up->admin_state, WCCP_ADMIN_UP);
@@ -330,7 +331,13 @@ TEST_F(Config, StoppingAllLeavesTheDisabledAlone) {
     wccp_stop_service_groups_by_interface(wan);
     EXPECT_EQ(up->hia_timer.active, 0);
     EXPECT_TRUE(wan->start_count == 2 && wan->stop_count == 1);
-    EXPECT_EQ(down->change_number, 3u);
+    EXPECT_EQ(modify(3, WCCP_CFG_ADMIN), 0); // disabled once more
+    EXPECT_EQ(unset->admin_state, 0u);
+    EXPECT_EQ((numbers{down->change_number, unset->change_number}), (numbers{3, 3}));
+    wccp_grp_config enabled = {};
+    enabled.admin = WCCP_ADMIN_UP;
+    EXPECT_EQ(modify(3, WCCP_CFG_ADMIN, enabled), 0);
+    EXPECT_TRUE(unset->admin_state == WCCP_ADMIN_UP && unset->hia_timer.active == 1);
 }
 
 // What the monitoring tree's own tests can't see of the answers that it gives.

@@ -88,15 +88,16 @@ TEST_F(Manager, InBridgeModeNobodyTicksButReceiversRun) {
     EXPECT_EQ(threads_named("WCCP_RX_lo"), 1) << "an interface with an address has its receive thread";
     EXPECT_EQ(threads_named("WCCP_TIMER"), 0);
     // A tick by hand: enabled groups only, and nothing once an exit has begun.
-    wccp_service_group *up = add_group(1, WCCP_ADMIN_UP), *down = add_group(2, WCCP_ADMIN_DOWN);
-    down->monitor_timer = up->monitor_timer;
+    wccp_service_group *up = add_group(1, WCCP_ADMIN_UP), *down = add_group(2, WCCP_ADMIN_DOWN),
+                       *unset = add_group(3, 0);
+    unset->monitor_timer = down->monitor_timer = up->monitor_timer;
     wccp_tick();
     wccp_tick();
     wccpd_exiting = 1;
     wccp_tick();
     EXPECT_EQ(wccp_g.seconds, 2u);
     EXPECT_EQ(up->monitor_timer.countdown, 3u);
-    EXPECT_EQ(down->monitor_timer.countdown, 5u);
+    EXPECT_EQ(down->monitor_timer.countdown + unset->monitor_timer.countdown, 10u);
 }
 
 TEST_F(Manager, OnlyBridgeModeStopsTheEngine) {
