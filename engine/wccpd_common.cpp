@@ -14,6 +14,12 @@
 // releases the mutex on its way out and withdraws an add, as after a time-out, since nobody would know the
 // tunnel that came of it.
 //
+// Callers wait with the engine lock held, and a tunneld that hangs must not take down groups that need no
+// tunnel. After a time-out, therefore, adds and L2 returns fail at once as if they had timed out, for ten
+// seconds or until tunneld has cleared a command that stayed in the slot; then one is tried. The seconds are
+// the monotonic clock's: the engine's own stand still while a command is waited for. Deletes are always
+// tried, since nobody would repeat them, except at exit, where none is tried after the first that timed out.
+//
 // The reset at exit runs on the main thread while an engine thread may be waiting. It sets `abandon`, which
 // ends a wait at its next look with the result of a time-out, then waits for the mutex, and only then
 // clears the header: a waiter never sees a `command` that the reset has cleared. Commands after the reset
@@ -27,15 +33,31 @@
 
 #include <cstring>
 
+#include "engine/wccp_host.h"
 #include "runtime/cmem.h"
 #include "runtime/guards.h"
 #include "runtime/logging.h"
+#include "runtime/ttime.h"
 
 static pthread_mutex_t mailbox_mutex = PTHREAD_MUTEX_INITIALIZER;
 static std::atomic<bool> abandon;
 static wccp_tunnel_mailbox *created_mailbox; // null until this process has created the block
 
-static constexpr int ANSWER_POLLS = 2000;
+static constexpr int ANSWER_POLLS = 2000;    // of a millisecond
+static constexpr int64_t SILENCE_MS = 10000; // until a tunneld that was silent is tried again
+
+namespace {
+
+// What is known of a tunneld that let a command time out, until it answers one.
+struct tunneld_silence {
+    bool lasts;
+    bool during_exit;
+    bool command_stays; // in the slot, for tunneld to clear
+    int64_t since_ms;
+};
+tunneld_silence silence; // mailbox_mutex
+
+} // namespace
 
 // mailbox_mutex held.
 static void reset_block(wccp_tunnel_mailbox *mailbox, uint32_t index) {
@@ -66,6 +88,7 @@ int wccp_init_shmem() {
     {
         const mutex_guard guard(&mailbox_mutex);
         reset_block(mailbox, WCCP_NO_INDEX);
+        silence = {};
         mailbox_put(wccp_mailbox, mailbox);
         mailbox_put(created_mailbox, mailbox);
     }
@@ -102,18 +125,7 @@ struct mailbox_inputs {
     uint32_t l2_value;
 };
 
-// What is left of a command that nobody waits for any more: an add is withdrawn, the others stay pending.
-struct pending_command {
-    ~pending_command() {
-        if (!answered && code == MAILBOX_ADD_TUNNEL)
-            mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
-    }
-    wccp_tunnel_mailbox *mailbox;
-    uint16_t code;
-    bool answered;
-};
-
-// Each command, and the line that tells of its time-out.
+// Each command, and the line that reports its time-out.
 struct command_kind {
     uint16_t code;
     int32_t time_out_level;
@@ -123,15 +135,29 @@ const command_kind add_tunnel = {MAILBOX_ADD_TUNNEL, LC_LOG_NOTICE, "GRE tunnel 
 const command_kind delete_tunnel = {MAILBOX_DELETE_TUNNEL, LC_LOG_DEBUG, "GRE tunnel delete timed out"};
 const command_kind set_l2_return = {MAILBOX_L2_RETURN, LC_LOG_ERR, "GRE tunnel L2 return add timed out"};
 
-// Gives the command and waits. True when tunneld has answered; the answer then stands in the outputs.
-bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_t *out_status,
-                  uint32_t *out_index) {
-    const mutex_guard guard(&mailbox_mutex);
-    wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
-    if (!mailbox)
+// True for a command that is not tried. mailbox_mutex held.
+bool is_refused(uint16_t code, const wccp_tunnel_mailbox *mailbox) {
+    if (!silence.lasts)
         return false;
+    if (wccpd_shutdown_in_progress() == 1)
+        return silence.during_exit;
+    if (code == MAILBOX_DELETE_TUNNEL)
+        return false;
+    if (silence.command_stays && mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE)
+        return false;
+    return lt_monotonic_ms() - silence.since_ms < SILENCE_MS;
+}
+
+void note_silence(uint16_t code) {
+    silence = {.lasts = true,
+               .during_exit = wccpd_shutdown_in_progress() == 1,
+               .command_stays = code != MAILBOX_ADD_TUNNEL,
+               .since_ms = lt_monotonic_ms()};
+}
+
+void write_command(wccp_tunnel_mailbox *mailbox, uint16_t code, const mailbox_inputs *inputs) {
     mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
-    if (kind->code == MAILBOX_L2_RETURN) {
+    if (code == MAILBOX_L2_RETURN) {
         mailbox_put(mailbox->l2_group, inputs->l2_group);
         mailbox_put(mailbox->l2_value, inputs->l2_value);
     } else {
@@ -140,25 +166,64 @@ bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32
         mailbox_put(mailbox->remote_ip, inputs->remote_ip);
         mailbox_put(mailbox->fmst_index, inputs->fmst_index);
     }
-    pending_command pending = {mailbox, kind->code, false};
-    mailbox->command.store(kind->code, std::memory_order_release);
-    for (int i = 0; i < ANSWER_POLLS; i++) {
+    mailbox->command.store(code, std::memory_order_release);
+}
+
+// A command that is being waited for. However the wait ends, an add without an answer is withdrawn; the other
+// commands stay pending.
+struct pending_command {
+    ~pending_command() { is_answered_at_last(); }
+    bool is_answered() const { return mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE; }
+    bool is_answered_at_last() const {
+        return code == MAILBOX_ADD_TUNNEL ? !wccp_withdraw_command(mailbox) : is_answered();
+    }
+    wccp_tunnel_mailbox *mailbox;
+    uint16_t code;
+};
+
+enum class wait_end { ANSWERED, TIMED_OUT, ABANDONED };
+
+wait_end wait_for_answer(wccp_tunnel_mailbox *mailbox, uint16_t code) {
+    const pending_command pending = {mailbox, code};
+    wait_end end = wait_end::TIMED_OUT;
+    for (int i = 0; i < ANSWER_POLLS && end == wait_end::TIMED_OUT; i++) {
         {
             const cancel_off_guard whole;
             poll(nullptr, 0, 1);
         }
-        if (mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE) {
-            pending.answered = true;
-            *out_status = mailbox_get(mailbox->status);
-            *out_index = mailbox_get(mailbox->fmst_index);
-            return true;
-        }
+        if (pending.is_answered())
+            return wait_end::ANSWERED;
         if (abandon.load(std::memory_order_acquire))
-            return false;
-        pthread_testcancel();
+            end = wait_end::ABANDONED;
+        else
+            pthread_testcancel();
     }
-    QV_LOG(kind->time_out_level, "%s", kind->time_out_line);
-    return false;
+    return pending.is_answered_at_last() ? wait_end::ANSWERED : end;
+}
+
+// Gives the command and waits, unless it is refused. True when tunneld has answered; its answer is then in
+// the outputs.
+bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_t *out_status,
+                  uint32_t *out_index) {
+    const mutex_guard guard(&mailbox_mutex);
+    wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
+    if (!mailbox)
+        return false;
+    wait_end end = wait_end::TIMED_OUT;
+    if (!is_refused(kind->code, mailbox)) {
+        write_command(mailbox, kind->code, inputs);
+        end = wait_for_answer(mailbox, kind->code);
+        if (end == wait_end::TIMED_OUT)
+            note_silence(kind->code);
+    }
+    if (end == wait_end::TIMED_OUT)
+        QV_LOG(kind->time_out_level, "%s", kind->time_out_line);
+    if (end != wait_end::ANSWERED)
+        return false;
+    silence.lasts = false;
+    *out_status = mailbox_get(mailbox->status);
+    *out_index = mailbox_get(mailbox->fmst_index);
+    return true;
 }
 
 mailbox_inputs tunnel_inputs(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,

@@ -4,11 +4,11 @@
 // read and written as one access of its own width with acquire and release order, so that neither the
 // compiler nor the machine moves an input across the `command` that hands it over.
 //
-// wccpd gives up a command after about two seconds and may then put another in its place, while tunneld is
-// still reading. So the inputs are read twice with looks at `command` around and between: wccpd takes
-// `command` to 0 before it touches an input, hence inputs that agree with no 0 in between belong to one
-// command. A reader that doesn't get there in a thousand tries (there is no command any more, or wccpd stands
-// still in the middle of writing one) takes what it has; it looks at `command` again before it acts.
+// wccpd gives up a command after about two seconds and may then replace it while tunneld is still reading.
+// Therefore the inputs are read twice, with `command` checked before, between and after: wccpd sets `command`
+// to 0 before it touches an input, hence inputs that agree, with no 0 seen, belong to one command. A reader
+// that does not get there in a thousand tries (there is no command any more, or wccpd is held up in the
+// middle of writing one) takes what it has; it checks `command` again before it acts.
 
 #include "platform/tunnel_mailbox.h"
 
@@ -40,6 +40,11 @@ bool wccp_attach_mailbox() {
     auto *mailbox = static_cast<wccp_tunnel_mailbox *>(block);
     mailbox_put(wccp_mailbox, mailbox);
     return true;
+}
+
+// Both sides end a command by an exchange: exactly one of them finds it in the slot.
+bool wccp_withdraw_command(wccp_tunnel_mailbox *mailbox) {
+    return mailbox->command.exchange(MAILBOX_IDLE, std::memory_order_acq_rel) != MAILBOX_IDLE;
 }
 
 uint16_t wccp_get_tunnel_command() {
@@ -109,11 +114,12 @@ uint32_t wccp_get_fmst_index() {
     return mailbox ? mailbox_get(mailbox->fmst_index) : WCCP_NO_INDEX;
 }
 
-void wccp_set_tunnel_command_status(uint32_t status) {
-    if (wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox)) {
-        mailbox_put(mailbox->status, status);
-        mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
-    }
+bool wccp_set_tunnel_command_status(uint32_t status) {
+    wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
+    if (!mailbox)
+        return false;
+    mailbox_put(mailbox->status, status);
+    return mailbox->command.exchange(MAILBOX_IDLE, std::memory_order_acq_rel) != MAILBOX_IDLE;
 }
 
 uint32_t wccp_get_role(uint16_t policy_group) {

@@ -65,6 +65,10 @@ extern wccp_tunnel_mailbox *wccp_mailbox;
 // Attaches the block that wccpd created, if it exists and is long enough; false when there is none.
 bool wccp_attach_mailbox();
 
+// wccpd's side: takes back an add that it does not wait for any longer. False when tunneld has answered it;
+// the answer is then in the outputs.
+bool wccp_withdraw_command(wccp_tunnel_mailbox *mailbox);
+
 // tunneld's side. Without the block these give the defaults or do nothing.
 uint16_t wccp_get_tunnel_command();
 void wccp_get_tunnel_parameters(uint16_t *out_tunnel_id, mailbox_address *out_local,
@@ -72,5 +76,6 @@ void wccp_get_tunnel_parameters(uint16_t *out_tunnel_id, mailbox_address *out_lo
 void wccp_get_config_paramters(uint8_t *out_group, uint32_t *out_value);
 void wccp_set_fmst_index(uint32_t index);
 uint32_t wccp_get_fmst_index();
-void wccp_set_tunnel_command_status(uint32_t status); // comes last: it releases the waiting wccpd
+// Comes last: it releases the waiting wccpd. False when the command had been withdrawn, or there is no block.
+bool wccp_set_tunnel_command_status(uint32_t status);
 uint32_t wccp_get_role(uint16_t policy_group);

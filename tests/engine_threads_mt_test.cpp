@@ -196,6 +196,8 @@ TEST_F(Threads, ExitWhileAReceiverWaitsForAnAbsentTunneld) {
         if (wccp_interface *again = wccp_if_find_interface("wan0"))
             make_another_receiver(again);
         tunneld->answer_with(tunneld_does);
+        uint32_t index = 0;
+        wccp_del_tunnel_encap(1, {}, {}, &index); // is answered: adds are tried again
         const wccp_interface *wan = add_group(61, "wan0")->interfaces[0];
         start_timer_thread();
         tunneld->answer_with(tunneld_is_silent);

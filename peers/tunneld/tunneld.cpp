@@ -107,6 +107,15 @@ bool still_there(const tunneld_command &command) {
            wccp_get_tunnel_command() == command.code;
 }
 
+// False when wccpd has given the command up: it gets no answer.
+bool answer(const tunneld_command &given, uint32_t index, uint32_t status) {
+    if (!still_there(given))
+        return false;
+    if (given.code != MAILBOX_L2_RETURN)
+        wccp_set_fmst_index(index);
+    return wccp_set_tunnel_command_status(status);
+}
+
 uint32_t take_index(tunneld *daemon) {
     const uint32_t index = daemon->next_index;
     if (index != WCCP_NO_INDEX && ++daemon->next_index == WCCP_NO_INDEX)
@@ -204,15 +213,11 @@ bool step(tunneld *daemon, bool *out_end) {
     const char *result;
     const uint32_t status = carry_out(daemon, command, &command.index, &result);
     *out_end = daemon->options.slow_ms && sleep_or_end(daemon->options.slow_ms);
-    if (!still_there(given)) {
+    if (!answer(given, command.index, status)) {
         if (code == MAILBOX_ADD_TUNNEL)
             daemon->tunnels = before;
-        print_command(daemon, command, "withdrawn");
-        return true;
+        result = "withdrawn";
     }
-    if (code != MAILBOX_L2_RETURN)
-        wccp_set_fmst_index(command.index);
-    wccp_set_tunnel_command_status(status);
     print_command(daemon, command, result);
     return true;
 }
