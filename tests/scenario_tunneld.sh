@@ -1,6 +1,6 @@
 #!/bin/bash
-# The tunnel daemon isn't there, is slow, refuses, says nothing, dies: the group does what it can, says what it can't,
-# and wccpd ends in order in each of these.
+# The tunnel daemon is absent, slow, refuses, is silent, hangs or dies: groups do what they can and report what they
+# can't, and wccpd ends in order and in time in each of these.
 #   scenario_tunneld.sh DIRECTORY_OF_THE_PROGRAMS [CASE...]
 set -u
 : "${LAB_SPEED:=4}" # commands to tunneld are waited for in seconds of the wall
@@ -55,6 +55,57 @@ case_silent() {
 case_refusing() {
     start --refuse
     refused
+    finish a1
+}
+timed() { # MILLISECONDS COMMAND...
+    local began=${EPOCHREALTIME/./} took
+    "${@:2}" || die "failed: ${*:2}"
+    took=$(((${EPOCHREALTIME/./} - began) / 1000))
+    [ $took -le "$1" ] || die "took $took ms: ${*:2}"
+}
+# However many routers need a tunnel, a group that needs none keeps its pace, and the operator gets answers.
+case_silent_beside_a_healthy_group() {
+    LAB_SPEED=1 # these are the wall's seconds
+    lab_router r1 10.0.0.{1..10} -- --forward gre --return gre
+    lab_router r2 10.0.0.20 -- --forward l2 --return l2
+    LAB_TUNNELD=--silent
+    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.{1..10})" "$(lab_group 52 10.0.0.20)"
+    local i
+    for i in {1..56}; do
+        timed 3000 lab_manage a1 get /qv/wccpd/wccp/srv_grp/state/52/oper >/dev/null
+        sleep 0.5
+    done
+    role a1 30 52 ACTIVE
+    jq -es '[.[] | select(.what == "here-i-am") | .t] | [.[1:], .[:-1]] | transpose | map(.[0] - .[1]) |
+        length >= 2 and max < 12.5' "$LAB/r2.log" >/dev/null || die "Here-I-Am late: $(grep -o '^.*here-i-am' "$LAB/r2.log")"
+    finish a1 -- 'GRE tunnel L2 return add timed out'
+}
+case_silent_at_the_start() {
+    lab_router r1 10.0.0.1 -- --forward l2 --return l2
+    lab_appliance a1 10.0.0.101
+    LAB_FOUND[a1]=$(lab_remains a1)
+    lab_write_config a1 "$(for i in {51..60}; do lab_group "$i" 10.0.0.1; done)"
+    lab_mgmtd_start a1
+    lab_start a1 tunneld tunneld --silent
+    timed 5000 lab_wccpd_start a1
+    [ "$(lab_log a1 | grep -c 'GRE tunnel L2 return add timed out')" = 10 ] || die "not said for each group"
+    finish a1 -- 'GRE tunnel L2 return add timed out'
+}
+case_hung_at_the_end() {
+    lab_router r1 10.0.0.{1..32} -- --forward gre --return gre
+    appliance a1 10.0.0.101 "$(for i in 0 1 2 3; do
+        mapfile -t routers < <(seq -f 10.0.0.%g $((8 * i + 1)) $((8 * i + 8)))
+        lab_group $((51 + i)) "${routers[@]}"
+    done)"
+    local i
+    for i in {51..54}; do role a1 60 "$i" ACTIVE; done
+    [ "$(lab_log a1 | grep -c 'created GRE tunnel id')" = 32 ] || die "not 32 tunnels"
+    kill -STOP "$(lab_pid a1 tunneld)"
+    timed 5000 lab_stop a1 wccpd
+    for i in {1..32}; do
+        router_at_is r1 "10.0.0.$i" 5 $((51 + (i - 1) / 8)) '.counters.rx_shutdown == 1'
+    done
+    kill -CONT "$(lab_pid a1 tunneld)"
     finish a1
 }
 # mgmtd keeps both: a crash of tunneld ends wccpd in order, and all of it comes back with tunnels of its own.
