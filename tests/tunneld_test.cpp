@@ -3,13 +3,17 @@
 
 #include <gtest/gtest.h>
 #include <sched.h>
+#include <signal.h>
 #include <sys/shm.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <functional>
+#include <map>
 #include <string>
 #include <thread>
 
@@ -18,6 +22,25 @@
 #include "runtime/cmem.h"
 
 using namespace std::chrono_literals;
+
+// The C library's, in its place: with a clock of the test, on which a sleep takes no time.
+static std::function<bool()> wakes_up; // ends the program when true
+static int64_t clock_ms;
+extern "C" int sigtimedwait(const sigset_t *, siginfo_t *, const timespec *time) {
+    const int64_t ms = time->tv_sec * 1000 + time->tv_nsec / 1000000;
+    if (!wakes_up) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(ms));
+        return -1;
+    }
+    clock_ms += ms;
+    return wakes_up() ? SIGTERM : -1;
+}
+extern "C" int clock_gettime(clockid_t clock, timespec *out) noexcept {
+    const long result = syscall(SYS_clock_gettime, clock, out);
+    if (wakes_up)
+        *out = {clock_ms / 1000, clock_ms % 1000 * 1000000};
+    return static_cast<int>(result);
+}
 
 namespace {
 
@@ -173,4 +196,22 @@ TEST_F(Tunneld, ACommandThatWasGivenUpGetsNoAnswer) {
         EXPECT_EQ(daemon.tunnels.size(), row.answered ? 1u : 0u);
         EXPECT_EQ(mailbox->command, row.answered ? 0 : row.code);
     }
+}
+
+// After a quiet minute it wakes up 20 times a second, and the next command is answered all the same.
+TEST_F(Tunneld, WakesUpSeldomWhenItIsQuiet) {
+    std::map<int64_t, int> in_second;
+    tunneld_start(&daemon, {}, out);
+    wakes_up = [&] {
+        in_second[clock_ms / 1000]++;
+        if (clock_ms == 90000)
+            give(MAILBOX_ADD_TUNNEL, 320, 0x0A000002);
+        return clock_ms >= 95000;
+    };
+    tunneld_run(&daemon);
+    wakes_up = nullptr;
+    EXPECT_EQ(in_second[30], 200);
+    EXPECT_EQ(in_second[80], 20);
+    EXPECT_EQ(mailbox->command, 0);
+    EXPECT_EQ(in_second[93], 200);
 }

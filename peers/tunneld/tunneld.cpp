@@ -1,14 +1,15 @@
-// The daemon's one thread: a look at the mailbox each millisecond for a second after a command, each five
-// milliseconds when it has been quiet, four times a second while there is no mailbox. It sleeps in
-// sigtimedwait, so that a signal ends it at once and nothing else interrupts it.
+// The daemon's one thread. It looks at the mailbox each millisecond for a second after a command, since more
+// follow, less often the longer it has been quiet, and four times a second while there is no mailbox. wccpd
+// waits for two seconds, of which the longest pause takes a small part. The thread sleeps in sigtimedwait: a
+// signal ends it at once, and nothing else interrupts it.
 //
 // wccpd gives a command up after two seconds: an add is then withdrawn, a delete or an L2 return is
-// overwritten by the next command. So a command is looked at again after it has been read and once more
+// overwritten by the next command. Therefore a command is checked again after it has been read and once more
 // before it is answered. One that is gone by then gets no answer, since that would be taken for the answer to
 // another, and an add that is gone is undone, since nobody knows its tunnel.
 //
 // A tunnel's ends are its identity and its id a handle, as on wccpd's side: an add under another id, or under
-// an id whose delete was lost, takes the place of what was there.
+// an id whose delete was lost, replaces what was there.
 
 #include "peers/tunneld/tunneld.h"
 
@@ -25,8 +26,14 @@
 
 namespace {
 
-constexpr int64_t BUSY_MS = 1, QUIET_MS = 5, DETACHED_MS = 250;
-constexpr int64_t BUSY_FOR_MS = 1000, ROLES_EVERY_MS = 1000;
+constexpr int64_t DETACHED_MS = 250, ROLES_EVERY_MS = 1000;
+
+// The time to the next look at the mailbox, by the time since the last command or the start.
+int64_t pause_ms(int64_t quiet_ms) {
+    if (quiet_ms < 1000)
+        return 1;
+    return quiet_ms < 60000 ? 5 : 50;
+}
 
 sigset_t end_signals() {
     sigset_t set;
@@ -237,17 +244,17 @@ bool tunneld_step(tunneld *daemon) {
 }
 
 void tunneld_run(tunneld *daemon) {
-    int64_t busy_until = 0, roles_at = 0;
+    int64_t last_command = lt_monotonic_ms(), roles_at = 0;
     for (bool end = false; !end;) {
         const int64_t now = lt_monotonic_ms();
         if (step(daemon, &end)) {
-            busy_until = now + BUSY_FOR_MS;
+            last_command = now;
             continue;
         }
         if (daemon->options.roles && daemon->attached && now >= roles_at) {
             print_roles(daemon);
             roles_at = now + ROLES_EVERY_MS;
         }
-        end = sleep_or_end(!daemon->attached ? DETACHED_MS : now < busy_until ? BUSY_MS : QUIET_MS);
+        end = sleep_or_end(daemon->attached ? pause_ms(now - last_command) : DETACHED_MS);
     }
 }
