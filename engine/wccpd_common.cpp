@@ -17,8 +17,9 @@
 // Callers wait with the engine lock held, and a tunneld that hangs must not take down groups that need no
 // tunnel. After a time-out, therefore, adds and L2 returns fail at once as if they had timed out, for ten
 // seconds or until tunneld has cleared a command that stayed in the slot; then one is tried. The seconds are
-// the monotonic clock's: the engine's own stand still while a command is waited for. Deletes are always
-// tried, since nobody would repeat them, except at exit, where none is tried after the first that timed out.
+// the monotonic clock's: the engine's own stand still while a command is waited for. A delete is always
+// given, since nobody would repeat it, but it is not waited for after another that timed out. At exit nothing
+// is waited for after the first command that timed out.
 //
 // The reset at exit runs on the main thread while an engine thread may be waiting. It sets `abandon`, which
 // ends a wait at its next look with the result of a time-out, then waits for the mutex, and only then
@@ -48,11 +49,10 @@ static constexpr int64_t SILENCE_MS = 10000; // until a tunneld that was silent 
 
 namespace {
 
-// What is known of a tunneld that let a command time out, until it answers one.
+// The last command that timed out, until tunneld answers another.
 struct tunneld_silence {
-    bool lasts;
+    uint16_t code; // MAILBOX_IDLE: there is none
     bool during_exit;
-    bool command_stays; // in the slot, for tunneld to clear
     int64_t since_ms;
 };
 tunneld_silence silence; // mailbox_mutex
@@ -135,24 +135,20 @@ const command_kind add_tunnel = {MAILBOX_ADD_TUNNEL, LC_LOG_NOTICE, "GRE tunnel 
 const command_kind delete_tunnel = {MAILBOX_DELETE_TUNNEL, LC_LOG_DEBUG, "GRE tunnel delete timed out"};
 const command_kind set_l2_return = {MAILBOX_L2_RETURN, LC_LOG_ERR, "GRE tunnel L2 return add timed out"};
 
-// True for a command that is not tried. mailbox_mutex held.
-bool is_refused(uint16_t code, const wccp_tunnel_mailbox *mailbox) {
-    if (!silence.lasts)
-        return false;
-    if (wccpd_shutdown_in_progress() == 1)
-        return silence.during_exit;
-    if (code == MAILBOX_DELETE_TUNNEL)
-        return false;
-    if (silence.command_stays && mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE)
-        return false;
-    return lt_monotonic_ms() - silence.since_ms < SILENCE_MS;
-}
+enum class effort { NONE, GIVE, GIVE_AND_WAIT };
 
-void note_silence(uint16_t code) {
-    silence = {.lasts = true,
-               .during_exit = wccpd_shutdown_in_progress() == 1,
-               .command_stays = code != MAILBOX_ADD_TUNNEL,
-               .since_ms = lt_monotonic_ms()};
+// What is done about a command. mailbox_mutex held.
+effort effort_for(uint16_t code, const wccp_tunnel_mailbox *mailbox) {
+    const bool exiting = wccpd_shutdown_in_progress() == 1;
+    if (silence.code == MAILBOX_IDLE || (exiting && !silence.during_exit))
+        return effort::GIVE_AND_WAIT;
+    const bool cleared = silence.code != MAILBOX_ADD_TUNNEL &&
+                         mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE;
+    if (!exiting && (cleared || lt_monotonic_ms() - silence.since_ms >= SILENCE_MS))
+        return effort::GIVE_AND_WAIT;
+    if (code != MAILBOX_DELETE_TUNNEL)
+        return effort::NONE;
+    return exiting || silence.code == MAILBOX_DELETE_TUNNEL ? effort::GIVE : effort::GIVE_AND_WAIT;
 }
 
 void write_command(wccp_tunnel_mailbox *mailbox, uint16_t code, const mailbox_inputs *inputs) {
@@ -209,18 +205,20 @@ bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32
     wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
     if (!mailbox)
         return false;
-    wait_end end = wait_end::TIMED_OUT;
-    if (!is_refused(kind->code, mailbox)) {
+    const effort made = effort_for(kind->code, mailbox);
+    if (made != effort::NONE)
         write_command(mailbox, kind->code, inputs);
+    wait_end end = wait_end::TIMED_OUT;
+    if (made == effort::GIVE_AND_WAIT) {
         end = wait_for_answer(mailbox, kind->code);
         if (end == wait_end::TIMED_OUT)
-            note_silence(kind->code);
+            silence = {kind->code, wccpd_shutdown_in_progress() == 1, lt_monotonic_ms()};
     }
     if (end == wait_end::TIMED_OUT)
         QV_LOG(kind->time_out_level, "%s", kind->time_out_line);
     if (end != wait_end::ANSWERED)
         return false;
-    silence.lasts = false;
+    silence = {};
     *out_status = mailbox_get(mailbox->status);
     *out_index = mailbox_get(mailbox->fmst_index);
     return true;

@@ -12,8 +12,9 @@ int wccp_init_shmem();
 int wccp_cleanup_shmem();
 
 // Commands: each waits for tunneld's answer, up to about 2 seconds. After one that timed out, adds and L2
-// returns fail at once for up to 10 seconds; during the exit, so does every command after one that timed out.
-// Addresses in host order. tunneld's status, in which 1 is failure; 1 as well without an answer.
+// returns fail at once for up to 10 seconds, and further deletes are given but not waited for; during the
+// exit nothing is waited for after a time-out. Addresses in host order. tunneld's status, in which 1 is
+// failure; 1 as well without an answer.
 int wccp_add_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
                           uint32_t *inout_index);
 int wccp_del_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,

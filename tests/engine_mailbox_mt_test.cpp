@@ -174,7 +174,7 @@ TEST_F(Mailbox, AnswersComeBackAsTheyWereGiven) {
     }
 }
 
-// Nobody answers. What is not waited for is refused; what is, takes 2000 polls.
+// Nobody answers. What is waited for takes 2000 polls.
 TEST_F(Mailbox, ASilentTunneldIsWaitedForOnceInAWhile) {
     uint32_t index = 42;
     const auto add = [&] { return wccp_add_tunnel_encap(9, address(1), address(2), &index); };
@@ -198,6 +198,7 @@ TEST_F(Mailbox, ASilentTunneldIsWaitedForOnceInAWhile) {
         {nullptr, add, 0, MAILBOX_L2_RETURN, add_line},
         {nullptr, l2_return, 0, MAILBOX_L2_RETURN, l2_line},
         {nullptr, remove, 2000, MAILBOX_DELETE_TUNNEL, no_line},
+        {nullptr, remove, 0, MAILBOX_DELETE_TUNNEL, no_line},
         {nullptr, add, 0, MAILBOX_DELETE_TUNNEL, add_line},
         {clear_slot, add, 2000, MAILBOX_IDLE, add_line},
         {nullptr, add, 0, MAILBOX_IDLE, add_line}, // an add leaves nothing in the slot to be cleared
@@ -209,8 +210,10 @@ TEST_F(Mailbox, ASilentTunneldIsWaitedForOnceInAWhile) {
         {nullptr, remove, 0, MAILBOX_DELETE_TUNNEL, no_line},
         {later(60), add, 0, MAILBOX_DELETE_TUNNEL, add_line},
         {exiting(0), remove, 2000, MAILBOX_DELETE_TUNNEL, no_line},
+        {later(10), remove, 2000, MAILBOX_DELETE_TUNNEL, no_line},
+        {clear_slot, remove, 2000, MAILBOX_DELETE_TUNNEL, no_line},
         // An answer after the last poll counts, and after it nothing is refused.
-        {late_answer, remove, 2000, MAILBOX_IDLE, no_line, 0},
+        {[&] { later(10)(), late_answer(); }, remove, 2000, MAILBOX_IDLE, no_line, 0},
         {late_answer, add, 2000, MAILBOX_IDLE, no_line, 0},
         {late_answer, l2_return, 2000, MAILBOX_IDLE, no_line, 0},
     };

@@ -91,16 +91,23 @@ case_silent_at_the_start() {
     [ "$(lab_log a1 | grep -c 'GRE tunnel L2 return add timed out')" = 10 ] || die "not said for each group"
     finish a1 -- 'GRE tunnel L2 return add timed out'
 }
-case_hung_at_the_end() {
+# Group 51 has the routers 10.0.0.1 to 8, group 52 the next eight, ...
+groups_of_eight() { # FIRST LAST
+    local i routers
+    for ((i = $1; i <= $2; i++)); do
+        mapfile -t routers < <(seq -f 10.0.0.%g $((8 * (i - 51) + 1)) $((8 * (i - 50))))
+        lab_group "$i" "${routers[@]}"
+    done
+}
+case_hung_while_tunnels_go() {
     lab_router r1 10.0.0.{1..32} -- --forward gre --return gre
-    appliance a1 10.0.0.101 "$(for i in 0 1 2 3; do
-        mapfile -t routers < <(seq -f 10.0.0.%g $((8 * i + 1)) $((8 * i + 8)))
-        lab_group $((51 + i)) "${routers[@]}"
-    done)"
+    appliance a1 10.0.0.101 "$(groups_of_eight 51 54)"
     local i
     for i in {51..54}; do role a1 60 "$i" ACTIVE; done
     [ "$(lab_log a1 | grep -c 'created GRE tunnel id')" = 32 ] || die "not 32 tunnels"
     kill -STOP "$(lab_pid a1 tunneld)"
+    configure a1 "$(groups_of_eight 52 54)"
+    timed 3000 lab_manage a1 get /qv/wccpd/wccp/srv_grp/state/54/oper >/dev/null
     timed 5000 lab_stop a1 wccpd
     for i in {1..32}; do
         router_at_is r1 "10.0.0.$i" 5 $((51 + (i - 1) / 8)) '.counters.rx_shutdown == 1'
