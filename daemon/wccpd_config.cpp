@@ -24,6 +24,7 @@
 #include "daemon/wccpd_mgmt.h"
 #include "engine/wccp_config.h"
 #include "engine/wccp_mgr.h"
+#include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"
 #include "mgmt/bnode.h"
 #include "mgmt/log_sync.h"
@@ -42,8 +43,15 @@ constexpr uint16_t ORPHANED_POLICY = 300; // where the members of a deleted poli
 
 struct config_walk {
     const bn_binding_array *bindings;
+    config_change_time time;
     const uint32_t *router_entries; // number of router entries of the group whose root has that place
 };
+
+// A change of the start may concern a group that the answer already had, or no longer had.
+bool group_exists(uint8_t id) {
+    const wccp_engine_lock lock;
+    return wccp_find_group(id) != nullptr;
+}
 
 lc_status is_deleted(const bn_binding *binding, bool *out) {
     uint32_t flags = 0;
@@ -94,8 +102,10 @@ lc_status count_router_entries(const bn_binding_array *bindings, uint32_t *count
 
 // ---- Whole groups
 
-void delete_group(uint8_t id) {
-    if (wccp_del_group(id) == 0)
+void delete_group(uint8_t id, config_change_time time) {
+    if (time != CONFIG_CHANGE_RUNNING && !group_exists(id))
+        QV_LOG(LC_LOG_INFO, "WCCP update: Group %d was deleted before the start read it", id);
+    else if (wccp_del_group(id) == 0)
         QV_LOG(LC_LOG_INFO, "WCCP update: Deleted Group %d", id);
     else
         QV_LOG(LC_LOG_ERR, "WCCP update: Failed to delete Group %d", id);
@@ -142,8 +152,12 @@ lc_status wccpd_config_update_group(const char *id_text, const config_walk *walk
     bool deleted = false;
     CHECK_STATUS(root_is_deleted(walk->bindings, root, &deleted));
     if (deleted) {
-        delete_group(id);
+        delete_group(id, walk->time);
         leave_policy_group(id);
+        return LC_OK;
+    }
+    if (walk->time != CONFIG_CHANGE_RUNNING && group_exists(id)) {
+        QV_LOG(LC_LOG_INFO, "WCCP update: Group %d was added before the start read it", id);
         return LC_OK;
     }
     config.group_id = id;
@@ -192,19 +206,19 @@ lc_status wccpd_config_policy_update_handler(const bn_binding_array *bindings, u
     return LC_OK;
 }
 
-lc_status walk_policy_groups(const bn_binding_array *bindings, uint32_t *out_count) {
+lc_status walk_policy_groups(const bn_binding_array *bindings, config_change_time, uint32_t *out_count) {
     CHECK_STATUS(mdc_foreach_binding_prequeried(bindings, POLICY_ROOTS, nullptr,
                                                 wccpd_config_policy_update_handler, nullptr, out_count));
     return LC_OK;
 }
 
-lc_status walk_groups(const bn_binding_array *bindings, uint32_t *out_count) {
+lc_status walk_groups(const bn_binding_array *bindings, config_change_time time, uint32_t *out_count) {
     owned<void, bn_free_memory> counts(
         calloc(bn_binding_array_length_quick(bindings) + size_t{1}, sizeof(uint32_t)));
     CHECK_NULL(counts.pointer);
     uint32_t *router_entries = static_cast<uint32_t *>(counts.pointer);
     CHECK_STATUS(count_router_entries(bindings, router_entries));
-    config_walk walk = {bindings, router_entries};
+    config_walk walk = {bindings, time, router_entries};
     CHECK_STATUS(mdc_foreach_binding_prequeried(bindings, GROUP_ROOTS, nullptr, wccpd_config_update_handler,
                                                 &walk, out_count));
     return LC_OK;
@@ -247,19 +261,32 @@ const group_node *find_changing_node(const char *name) {
     return nullptr;
 }
 
-lc_status change_group(const char *name, const tstr_array *parts, const bn_binding *binding, bool deleted) {
+// What the start read says more of a group than a change that it contains: the group is there without the
+// deleted node, and with the router entries, the priority and the protocol that a running group cannot be
+// given.
+lc_status change_group(const char *name, const tstr_array *parts, const bn_binding *binding, bool deleted,
+                       config_change_time time) {
     constexpr uint32_t GROUP_PART = 5, NODE_PART = 6, NODE_PARTS = 7;
     const char *id_text = tstr_array_get_str_quick(parts, GROUP_PART);
     const uint8_t id = static_cast<uint8_t>(id_text ? strtol(id_text, nullptr, 10) : 0);
-    if (deleted) {
-        delete_group(id);
-        return LC_OK;
-    }
     const char *last =
         tstr_array_length_quick(parts) == NODE_PARTS ? tstr_array_get_str_quick(parts, NODE_PART) : nullptr;
     const group_node *node = last ? find_changing_node(last) : nullptr;
-    if (!node && (!last || strcmp(last, "assign_detail") != 0)) {
+    const bool known = node || (last && strcmp(last, "assign_detail") == 0);
+    if (time == CONFIG_CHANGE_IN_ANSWER && (deleted || !known)) {
+        QV_LOG(LC_LOG_INFO, "WCCP update: %s was changed before the start read it", name);
+        return LC_OK;
+    }
+    if (deleted) {
+        delete_group(id, time);
+        return LC_OK;
+    }
+    if (!known) {
         QV_LOG(LC_LOG_ERR, "WCCP update: Unknown binding %s", name);
+        return LC_OK;
+    }
+    if (time != CONFIG_CHANGE_RUNNING && !group_exists(id)) {
+        QV_LOG(LC_LOG_INFO, "WCCP update: Group %d was deleted before the start read it", id);
         return LC_OK;
     }
     wccp_grp_config config = {};
@@ -271,7 +298,8 @@ lc_status change_group(const char *name, const tstr_array *parts, const bn_bindi
     return LC_OK;
 }
 
-lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_binding *binding, void *) {
+lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_binding *binding, void *data) {
+    const config_change_time time = *static_cast<const config_change_time *>(data);
     const tstring *stored = nullptr;
     CHECK_STATUS(bn_binding_get_name(binding, &stored));
     const char *name = ts_str(stored);
@@ -292,7 +320,7 @@ lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_binding *b
     if (wccpd_is_under(name, NODE_WCCPD_CONFIG)) {
         CHECK_STATUS(change_global(name, binding));
     } else if (wccpd_is_under(name, NODE_GROUP_CONFIG)) {
-        CHECK_STATUS(change_group(name, parts.pointer, binding, deleted));
+        CHECK_STATUS(change_group(name, parts.pointer, binding, deleted, time));
     } else if (strcmp(name, NODE_SYSTEM_MODE) == 0) {
         owned_tstring mode;
         CHECK_STATUS(wccpd_read_text(binding, &mode));
@@ -317,19 +345,21 @@ lc_status query_tree(const char *root, owned_bindings *out) {
 }
 
 lc_status query_nodes(const char *root) {
+    config_change_time time = CONFIG_CHANGE_RUNNING;
     owned_bindings bindings;
     CHECK_STATUS(query_tree(root, &bindings));
     if (bindings.pointer)
-        CHECK_STATUS(bn_binding_array_foreach(bindings.pointer, change_or_halt, nullptr));
+        CHECK_STATUS(bn_binding_array_foreach(bindings.pointer, change_or_halt, &time));
     return LC_OK;
 }
 
 lc_status query_roots(const char *root,
-                      lc_status (*walk_roots)(const bn_binding_array *bindings, uint32_t *out_count)) {
+                      lc_status (*walk_roots)(const bn_binding_array *bindings, config_change_time time,
+                                              uint32_t *out_count)) {
     owned_bindings bindings;
     CHECK_STATUS(query_tree(root, &bindings));
     if (bindings.pointer)
-        CHECK_STATUS(walk_roots(bindings.pointer, nullptr));
+        CHECK_STATUS(walk_roots(bindings.pointer, CONFIG_CHANGE_RUNNING, nullptr));
     return LC_OK;
 }
 
@@ -345,25 +375,16 @@ lc_status wccpd_config_query() {
     return LC_OK;
 }
 
-lc_status wccpd_config_apply_to_log(const bn_binding_array *new_values) {
-    (void)qv_handle_log_level_change(new_values);
-    const bn_binding *facility = nullptr;
-    CHECK_STATUS(bn_binding_array_get_binding_by_name(new_values, NODE_SYSTEM_FACILITY, &facility));
-    if (facility)
-        CHECK_STATUS(change_facility(facility));
-    return LC_OK;
-}
-
-lc_status wccpd_config_apply(bn_binding_array *new_values) {
+lc_status wccpd_config_apply(bn_binding_array *new_values, config_change_time time) {
     (void)qv_handle_log_level_change(new_values);
     uint32_t count = 0;
-    CHECK_STATUS(walk_policy_groups(new_values, &count));
+    CHECK_STATUS(walk_policy_groups(new_values, time, &count));
     QV_LOG(LC_LOG_INFO, "WCCP Group policy config callbacks: %d", static_cast<int>(count));
-    CHECK_STATUS(walk_groups(new_values, &count));
+    CHECK_STATUS(walk_groups(new_values, time, &count));
     QV_LOG(LC_LOG_INFO, "WCCP Group config callbacks: %d", static_cast<int>(count));
     if (count != 0)
         return LC_OK;
-    CHECK_STATUS(bn_binding_array_foreach(new_values, change_or_halt, nullptr));
+    CHECK_STATUS(bn_binding_array_foreach(new_values, change_or_halt, &time));
     QV_LOG(LC_LOG_INFO, "WCCP Modify config complete");
     return LC_OK;
 }

@@ -38,6 +38,7 @@
 #include <unistd.h>
 
 #include "daemon/wccpd_config.h"
+#include "daemon/wccpd_early_changes.h"
 #include "daemon/wccpd_mgmt.h"
 #include "engine/wccp_alarm_client.h"
 #include "engine/wccp_host.h"
@@ -52,7 +53,6 @@ const char *const wccpd_program_name = "wccpd";
 lew *wccpd_lwc;
 std::atomic<int32_t> m_daemon_status{WCCPD_INITIALIZING};
 std::atomic<int32_t> wccpd_exiting;
-bool wccpd_engine_begun;
 uint32_t g_qv_encap_entry_count;
 uint32_t g_qv_encap_wccp_first, g_qv_encap_wccp_last;
 uint32_t g_qv_encap_clstr_first, g_qv_encap_clstr_last;
@@ -144,7 +144,6 @@ lc_status wccpd_pid_init() {
 
 lc_status wccpd_serv_init() {
     CHECK_CONDITION(wccpd_lwc != nullptr);
-    wccpd_engine_begun = true;
     // The engine's threads order tunnels as soon as the first group has its router, which can be while the
     // configuration is still read: the ids stand before. wccpd_init tells them when it is through.
     (void)qv_encap_setup_entries();
@@ -162,11 +161,13 @@ lc_status wccpd_init() {
     for (wccpd_signal &known : wccpd_signals)
         CHECK_STATUS(
             lew_event_reg_signal(wccpd_lwc, &known.slot, known.number, wccpd_handle_signal, nullptr));
+    const early_changes_scope early_changes;
     for (lc_status (*step)() : wccpd_start_steps) {
         CHECK_STATUS(step());
         if (wccpd_shutdown_in_progress())
             return LC_CANCELLED;
     }
+    apply_early_changes();
     g_qv_encap_entry_count = qv_encap_setup_entries();
     LC_LOG(LC_LOG_NOTICE, "%s: encap entries:%d wccp start %d/%d clstr start %d/%d", "wccpd_init",
            static_cast<int>(g_qv_encap_entry_count), static_cast<int>(g_qv_encap_wccp_first),

@@ -16,7 +16,6 @@ extern lew *wccpd_lwc; // the main thread's event loop; null before lew_init and
 enum : int32_t { WCCPD_INITIALIZING = 0, WCCPD_READY = 1 };
 extern std::atomic<int32_t> m_daemon_status;
 extern const lc_enum_entry wccpd_status_table[];
-extern bool wccpd_engine_begun; // its records are there to be configured
 
 extern uint32_t g_qv_encap_entry_count;
 extern uint32_t g_qv_encap_clstr_first, g_qv_encap_clstr_last;

@@ -10,6 +10,7 @@
 #include <cstring>
 
 #include "daemon/wccpd_config.h"
+#include "daemon/wccpd_early_changes.h"
 #include "daemon/wccpd_main.h"
 #include "daemon/wccpd_monitor.h"
 #include "engine/wccp_host.h"
@@ -49,6 +50,7 @@ lc_status wccpd_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
 
 lc_status wccpd_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
     CHECK_STATUS(mgmt_client_response(&wccpd_client, response));
+    early_changes_are_answered();
     return LC_OK;
 }
 
@@ -94,17 +96,15 @@ lc_status wccpd_process_proc_fail(const char *event_name, const bn_binding_array
     return LC_OK;
 }
 
-// A change that comes before the engine is begun has no groups to change: the start reads the whole tree
-// later. The log's facility it reads from the file alone, and so what concerns the log is taken at once.
 lc_status wccpd_config_changed(const char *, bn_binding_array *bindings) {
     owned_bindings old_values, new_values;
     CHECK_STATUS(mdc_event_config_change_notif_extract(bindings, &old_values.pointer, &new_values.pointer));
-    if (!wccpd_engine_begun) {
-        LC_LOG(LC_LOG_INFO, "Configuration change before the engine's start: left to the start");
-        CHECK_STATUS(wccpd_config_apply_to_log(new_values.pointer));
-        return LC_OK;
-    }
-    CHECK_STATUS(wccpd_config_apply(new_values.pointer));
+    if (m_daemon_status == WCCPD_READY)
+        CHECK_STATUS(wccpd_config_apply(new_values.pointer));
+    else if (early_changes_are_kept())
+        CHECK_STATUS(keep_early_change(&new_values.pointer));
+    else
+        LC_LOG(LC_LOG_WARNING, "Configuration change ignored: the start has failed");
     return LC_OK;
 }
 
@@ -177,7 +177,7 @@ lc_status wccpd_mgmt_open_session() {
     lc_status status = mgmt_client_open(&wccpd_client, wccpd_program_name, wccpd_mgmt_msg_handler);
     if (status == LC_OK)
         status = wccpd_mgmt_register_interests();
-    if (status != LC_OK)
+    if (status != LC_OK && status != LC_CANCELLED)
         LC_LOG(LC_LOG_ERR, "Unable to connect to the management daemon");
     return status;
 }

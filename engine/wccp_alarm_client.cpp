@@ -84,7 +84,7 @@ static lc_status qv_alm_mgmt_handle_session_close(int, uint32_t, void *, void *)
 
 static lc_status qv_alm_mgmt_open_session(const char *client_name) {
     const lc_status status = mgmt_client_open(&qv_alm_client, client_name, qv_alm_mgmt_msg_handler);
-    if (status != LC_OK)
+    if (status != LC_OK && status != LC_CANCELLED)
         LC_LOG(LC_LOG_ERR, "Unable to connect to the management daemon");
     return status;
 }
@@ -136,7 +136,8 @@ static void *qv_alm_thread(void *client_name) {
     const lc_status status = start_session(static_cast<const char *>(client_name));
     tell_started();
     if (status != LC_OK) {
-        LC_LOG(LC_LOG_ERR, "qv_alm_thread: failed to initialize alarm session");
+        if (status != LC_CANCELLED)
+            LC_LOG(LC_LOG_ERR, "qv_alm_thread: failed to initialize alarm session");
         return nullptr;
     }
     LOG_STATUS(lew_dispatch(qv_alm_lwc, nullptr, nullptr));

@@ -67,7 +67,7 @@ lc_status mgmt_client_request(mgmt_client *client, bn_request_msg *request, bn_r
     *out_response = *client->captured_response;
     *client->captured_response = nullptr;
     *client->response_expected = 0;
-    return status;
+    return status == LC_OK && !*out_response && exit_has_begun(client) ? LC_CANCELLED : status;
 }
 
 lc_status mgmt_client_response(mgmt_client *client, const bn_response_msg *response) {

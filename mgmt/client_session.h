@@ -1,11 +1,12 @@
-// One management session of a process with all that stands under it, and the wait for an answer inside the
+// One management session of a process with all that belongs to it, and the wait for an answer inside the
 // loop. A process has one of these for each session; the cells that other files name are lent to it.
 //
 // A request is answered while its maker waits: the loop is run from inside the call, so that everything else
 // is delivered meanwhile, and waits nest. A wait ends with its answer, with the loss of the session, with a
 // failing loop, and, at every depth, once the exit has begun: the loop's escape flag is sticky, so that a
-// wait that went on by its own flag alone would spin. A request made after that is sent nowhere and gives
-// LC_CANCELLED, which travels up without a line.
+// wait that went on by its own flag alone would spin. A request that the exit leaves without an answer, and
+// one that is made after it has begun, gives LC_CANCELLED, which travels up without a line: an orderly stop
+// is no failure.
 #pragma once
 
 #include <atomic>

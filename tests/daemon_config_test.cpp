@@ -1,6 +1,7 @@
 // The configuration applied to an engine that stands still: what a group is made of, what each change does,
 // and what is said of values that make no sense.
 #include "daemon/wccpd_config.h"
+#include "daemon/wccpd_early_changes.h"
 #include "daemon/wccpd_group_nodes.h"
 #include "engine/wccp_utils.h"
 
@@ -337,12 +338,50 @@ TEST_F(DaemonConfig, PolicyMembership) {
     EXPECT_EQ(members(), "");
 }
 
-TEST_F(DaemonConfig, BeforeTheEngineOnlyTheLogFollows) {
-    binding_list list;
-    add_root(list, "51").add("/logging/syslog/facility/system", bn_type_uint32, "168");
-    EXPECT_EQ(wccpd_config_apply_to_log(list.array), LC_OK);
-    EXPECT_EQ(said("system facility to 21(local5), wccpd"), 1);
-    EXPECT_EQ(wccp_find_group(51), nullptr);
+TEST_F(DaemonConfig, ChangesOfTheStartAreAppliedAfterIt) {
+    const auto keep = [](binding_list &changes) {
+        EXPECT_EQ(keep_early_change(&changes.array.pointer), LC_OK);
+        EXPECT_EQ(changes.array.pointer, nullptr);
+    };
+    const auto keep_one = [&](const std::string &node, uint32_t type, const char *text, uint32_t flags = 0) {
+        binding_list changes;
+        keep(changes.add(CONFIG + node, type, text, flags));
+    };
+    const early_changes_scope scope;
+    // What the answer contains.
+    binding_list added;
+    keep(add_root(added, "51").add(CONFIG + "51/weight", bn_type_uint32, "5"));
+    keep_one("51/router/2/ipaddr", bn_type_ipv4addr, "10.0.0.9", bn_flag_deleted);
+    keep_one("51/priority", bn_type_uint32, "9");
+    keep_one("51/weight", bn_type_uint32, "6");
+    keep_one("52/weight", bn_type_uint32, "6");
+    keep_one("52", bn_type_uint8, "52", bn_flag_deleted);
+    early_changes_are_answered();
+    // What it doesn't contain.
+    keep_one("51/weight", bn_type_uint32, "7");
+    keep_one("51/weight", bn_type_uint32, "8");
+    keep_one("53", bn_type_uint8, "53", bn_flag_deleted);
+    keep_one("54", bn_type_uint8, "54");
+    const wccp_service_group *group = make("51");
+    make("53");
+    EXPECT_EQ(group->weight, 0);
+    apply_early_changes();
+    ASSERT_EQ(wccp_find_group(51), group);
+    EXPECT_EQ(group->weight, 8);
+    EXPECT_TRUE(!wccp_find_group(52) && !wccp_find_group(53) && wccp_find_group(54));
+    EXPECT_EQ(said("<139>"), 0);
+
+    keep_one("54/router/1/ipaddr", bn_type_ipv4addr, "10.0.0.9", bn_flag_deleted);
+    apply_early_changes();
+    EXPECT_EQ(wccp_find_group(54), nullptr);
+
+    const std::string half(EARLY_CHANGES_MAX_BYTES / 2, 'x');
+    keep_one("51/weight", bn_type_str, half.c_str());
+    binding_list second;
+    second.add(CONFIG + "51/weight", bn_type_str, half);
+    EXPECT_EQ(keep_early_change(&second.array.pointer), LC_NO_SPACE);
+    EXPECT_NE(second.array.pointer, nullptr);
+    EXPECT_EQ(said("Configuration change lost"), 1);
 }
 
 TEST_F(DaemonConfig, TheFacilityOfTheLogAndNothingElseOfIt) {

@@ -1,14 +1,18 @@
-// The exit that begins while the daemon waits for mgmtd: by a signal, by the loss of the session, by the word
-// that tunneld has gone, at each request of the start and once the daemon is ready. The daemon runs in a
-// process of its own; the provider is this test, which answers so many requests and no more.
+// What comes while the daemon waits for mgmtd: a signal, the loss of the session or the news that tunneld has
+// gone, which begin the exit at each request of the start and once the daemon is ready; queries and changes,
+// which come too early. The daemon runs in a process of its own; the provider is this test, which answers so
+// many requests and no more.
 #include <atomic>
 #include <csignal>
 #include <ctime>
+#include <sstream>
 #include <thread>
 
 #include <gtest/gtest.h>
 #include <sys/resource.h>
+#include <sys/shm.h>
 #include <sys/wait.h>
+#include <syslog.h>
 
 #include "daemon/wccpd_main.h"
 #include "mgmt/owners.h"
@@ -44,9 +48,13 @@ struct scripted_run {
     wire unanswered;
     std::vector<wire> responses;
 
-    scripted_run() {
-        // The platform's numbers, without which there is no mailbox.
+    explicit scripted_run(bool has_mailbox = true) {
+        // Without mem.conf there is no mailbox, and the start fails. The registry remembers what it has read.
+        for (const uint32_t key : {0xbeeffeedu, 0x5743434du})
+            shmctl(shmget(static_cast<key_t>(key), 0, 0), IPC_RMID, nullptr);
         EXPECT_EQ(system("cp " WCCP_SOURCE_DIR "/packaging/*.conf /etc/opt/rvl/"), 0);
+        if (!has_mailbox)
+            unlink("/etc/opt/rvl/mem.conf");
         EXPECT_TRUE(working.listen_as("mgmtd"));
         daemon = fork();
         if (daemon == 0)
@@ -146,17 +154,36 @@ struct scripted_run {
         if (what == cause::lost_session)
             alarms.close_client();
         if (what == cause::tunneld)
-            put_event("/pm/events/failure/crash", "tunneld");
+            put_event("/pm/events/failure/crash", {{"process_name", bn_type_str, "tunneld"}});
     }
-    void put_event(const char *name, const char *process) {
+    struct event_binding {
+        std::string name;
+        uint32_t type;
+        const char *value;
+    };
+    void put_event(const char *name, const std::vector<event_binding> &bindings) {
         owned_request event;
         ASSERT_EQ(bn_event_request_msg_create(&event.pointer, name), LC_OK);
-        if (process) {
-            ASSERT_EQ(bn_event_request_msg_append_new_binding(event.pointer, 0, "process_name", bn_type_str,
-                                                              process, nullptr),
+        for (const event_binding &each : bindings)
+            ASSERT_EQ(bn_event_request_msg_append_new_binding(event.pointer, 0, each.name.c_str(), each.type,
+                                                              each.value, nullptr),
                       LC_OK);
-        }
         put_request(event.pointer);
+    }
+    // A commit that adds nodes below the groups' root.
+    void put_added(const std::vector<event_binding> &nodes) {
+        std::vector<event_binding> entries;
+        std::vector<std::string> names;
+        for (const event_binding &node : nodes)
+            names.push_back("/qv/wccpd/wccp/srv_grp/config/" + node.name);
+        for (size_t i = 0; i < nodes.size(); i++) {
+            const std::string entry = "/mgmtd/notification/dbchange/" + std::to_string(i + 1);
+            entries.push_back({entry, bn_type_uint32, "1"});
+            entries.push_back({entry + "/change_type", bn_type_str, "add"});
+            entries.push_back({entry + "/name", bn_type_name, names[i].c_str()});
+            entries.push_back({entry + "/new_attribs/value", nodes[i].type, nodes[i].value});
+        }
+        put_event("/mgmtd/notify/dbchange", entries);
     }
     void expect_exit() {
         const double start = now_seconds();
@@ -171,37 +198,6 @@ struct scripted_run {
         EXPECT_LT(seconds_of(used.ru_utime) + seconds_of(used.ru_stime), CPU_SECONDS);
     }
 };
-
-} // namespace
-
-TEST(DaemonExit, AtEachRequestOfTheStart) {
-    int requests = 0;
-    {
-        scripted_run whole;
-        requests = whole.serve(1000);
-        EXPECT_GE(requests, 15);
-        whole.bring(cause::signal);
-        whole.expect_exit();
-    }
-    for (const cause what : {cause::signal, cause::lost_session, cause::tunneld})
-        for (int answered = 0; answered < requests; answered++) {
-            SCOPED_TRACE(std::string(cause_names[static_cast<int>(what)]) + " at request " +
-                         std::to_string(answered + 1));
-            scripted_run run;
-            ASSERT_EQ(run.serve(answered), answered + 1);
-            run.bring(what);
-            run.expect_exit();
-            if (HasFatalFailure())
-                return;
-        }
-}
-
-TEST(DaemonExit, WhileTheServiceIsNotOpen) {
-    scripted_run run;
-    ASSERT_TRUE(run.working.accept_client());
-    run.bring(cause::signal);
-    run.expect_exit();
-}
 
 // What the daemon logs from here on, read all the time.
 struct log_reader {
@@ -229,6 +225,12 @@ struct log_reader {
             place = found == std::string::npos ? place : found;
         }
     }
+    void expect_no_error() {
+        end();
+        std::istringstream lines(text);
+        for (std::string line; std::getline(lines, line);)
+            EXPECT_TRUE(line[0] != '<' || atoi(&line[1]) % 8 > LOG_ERR) << line;
+    }
     void end() {
         over = true;
         if (thread.joinable())
@@ -236,6 +238,41 @@ struct log_reader {
     }
     ~log_reader() { end(); }
 };
+
+} // namespace
+
+TEST(DaemonExit, AtEachRequestOfTheStart) {
+    int requests = 0;
+    {
+        scripted_run whole;
+        requests = whole.serve(1000);
+        EXPECT_GE(requests, 15);
+        whole.bring(cause::signal);
+        whole.expect_exit();
+    }
+    for (const cause what : {cause::signal, cause::lost_session, cause::tunneld})
+        for (int answered = 0; answered < requests; answered++) {
+            SCOPED_TRACE(std::string(cause_names[static_cast<int>(what)]) + " at request " +
+                         std::to_string(answered + 1));
+            log_reader log;
+            scripted_run run;
+            log.start();
+            ASSERT_EQ(run.serve(answered), answered + 1);
+            run.bring(what);
+            run.expect_exit();
+            if (what != cause::lost_session)
+                log.expect_no_error();
+            if (HasFatalFailure())
+                return;
+        }
+}
+
+TEST(DaemonExit, WhileTheServiceIsNotOpen) {
+    scripted_run run;
+    ASSERT_TRUE(run.working.accept_client());
+    run.bring(cause::signal);
+    run.expect_exit();
+}
 
 // The start waits for the alarm thread then, which waits for the provider.
 TEST(DaemonExit, WhileTheAlarmSessionIsNotOpen) {
@@ -250,7 +287,6 @@ TEST(DaemonExit, WhileTheAlarmSessionIsNotOpen) {
         run.alarms.listener = run.working.listener;
         ASSERT_TRUE(run.alarms.accept_client());
         run.alarms.listener = -1;
-        run.put_event("/mgmtd/notify/dbchange", nullptr); // the engine's records aren't there yet
         run.bring(what);
         run.expect_exit();
         const char *told = what == cause::signal    ? "Received SIGTERM"
@@ -260,27 +296,51 @@ TEST(DaemonExit, WhileTheAlarmSessionIsNotOpen) {
                              "qv_alm_mgmt_shutdown: cancel alm thread",
                              "qv_alm_mgmt_shutdown: alm thread exited", "WCCP: wccp manager is exiting",
                              "WCCP daemon exiting with code 0"});
-        log.expect_in_order({"qv_alm_thread: failed to initialize alarm session",
-                             "qv_alm_mgmt_shutdown: alm thread exited", "WCCP: wccp manager"});
-        if (what != cause::signal) // which comes at any moment
-            log.expect_in_order({"change before the engine's start: left to the start", told});
+        if (what == cause::signal || what == cause::tunneld)
+            log.expect_no_error();
+        else
+            log.expect_in_order({"Lost connection to mgmtd; exiting", "wccp manager is exiting"});
     }
 }
 
-// Queries find the daemon deaf until it is ready.
-TEST(DaemonExit, AQueryThatComesTooEarlyStaysUnanswered) {
+// Queries find the daemon deaf until it is ready; changes wait until the configuration has been read.
+TEST(DaemonExit, WhatComesTooEarly) {
+    log_reader log;
     scripted_run run;
+    log.start();
     ASSERT_EQ(run.serve(7), 8);
     run.ask("/qv/wccpd/system/state/is_alive");
-    ASSERT_GE(run.serve(1000), 5);
+    run.put_added({{"51", bn_type_uint8, "51"}, {"51/interface", bn_type_str, "lo"}});
+    ASSERT_EQ(run.serve(5), 6);
+    run.put_added({{"51/weight", bn_type_uint32, "7"}});
+    ASSERT_GE(run.serve(1000), 0);
     EXPECT_EQ(run.responses.size(), 0u);
     run.ask("/qv/wccpd/system/state/is_alive");
     ASSERT_EQ(run.serve(1000), 0);
     ASSERT_EQ(run.responses.size(), 1u);
     EXPECT_EQ(number_at(run.responses[0], 26, 2), bn_msg_query_response);
     EXPECT_NE(run.responses[0].find("Ready"), wire::npos);
+    run.put_added({{"51/weight", bn_type_uint32, "8"}});
     run.bring(cause::signal);
     run.expect_exit();
+    log.expect_in_order({"Received event: /mgmtd/notify/dbchange", "Received event: /mgmtd/notify/dbchange",
+                         "Created WCCP group 51", "set weight to 7", "encap entries"});
+}
+
+TEST(DaemonExit, AChangeAfterAStartThatHasFailed) {
+    log_reader log;
+    scripted_run run(false);
+    log.start();
+    run.serve(5);
+    run.put_added({{"51", bn_type_uint8, "51"}, {"51/interface", bn_type_str, "lo"}});
+    run.serve(1000);
+    run.put_added({{"52", bn_type_uint8, "52"}, {"52/interface", bn_type_str, "lo"}});
+    EXPECT_EQ(run.serve(1000), 0);
+    run.bring(cause::signal);
+    run.expect_exit();
+    log.expect_in_order({"WCCP: Cannot init shared memory",
+                         "Configuration change ignored: the start has failed", "Received SIGTERM"});
+    EXPECT_EQ(log.text.find("WCCP group 5"), std::string::npos);
 }
 
 TEST(DaemonExit, OnceReadyByASessionOrTunneld) {

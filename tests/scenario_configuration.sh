@@ -164,4 +164,31 @@ case_bridge() {
     finish a1
 }
 
+# What is committed while the daemon starts, 300 commits over 30 starts with 256 groups: none is lost, and none undone.
+case_start() {
+    local id text='' round absent=0 commits runs stands nodes=/qv/wccpd/wccp/srv_grp/config
+    for id in $(seq 0 255); do text+="$(lab_group "$id" 10.0.0.1 "weight=$id")"$'\n'; done
+    LAB_LOG_LEVEL=notice appliance a1 10.0.0.101 "$text"
+    for round in $(seq 30); do
+        lab_stop a1 wccpd || die "ended with $?"
+        # A group goes, the one that went before comes back, and eight others change.
+        lab_in a1 bash -c "set -e
+            ctl() { '$WCCP_BIN/mgmtctl' \"\$@\"; sleep 0.0\$((RANDOM % 4)); }
+            ctl delete $nodes/$round
+            for id in \$(shuf -i 100-255 -n 8); do ctl set $nodes/\$id/weight=$round\$((RANDOM % 100)); done
+            ctl set $nodes/$absent/interface=eth0 $nodes/$absent/weight=$round" >"$LAB/commits.out" 2>&1 &
+        commits=$!
+        lab_wccpd_start a1
+        wait $commits || die "commits: $(cat "$LAB/commits.out")"
+        absent=$round
+        runs=$(lab_manage a1 walk --children ${nodes/config/state} | jq -r '.[].name + "/debug"')
+        stands=$(lab_manage a1 walk --children $nodes | jq -r '.[].name + "/weight"')
+        # shellcheck disable=SC2086
+        diff <(lab_manage a1 get $runs | jq -r '.[] | "\(.name | split("/")[6]) \(.value | capture("WCCP weight *: (?<w>[0-9]+)").w)"' | sort) \
+            <(lab_manage a1 get $stands | jq -r '.[] | "\(.name | split("/")[6]) \(.value)"' | sort) >&2 ||
+            die "start $round: what runs differs from what is configured"
+    done
+    finish a1
+}
+
 lab_case

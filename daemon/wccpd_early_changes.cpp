@@ -1,0 +1,99 @@
+#include "daemon/wccpd_early_changes.h"
+
+#include <cstdlib>
+
+#include "daemon/wccpd_config.h"
+#include "runtime/logging.h"
+
+namespace {
+
+constexpr size_t BINDING_BYTES = 512; // of a binding, its attribute and their arrays
+
+struct early_change {
+    early_change *next;
+    bn_binding_array *new_values;
+    config_change_time time;
+};
+
+struct early_change_list {
+    early_change *first;
+    early_change **end; // where the next one goes; null when no changes are kept
+    size_t bytes;
+};
+early_change_list kept;
+
+size_t size_of(const bn_binding_array *bindings) {
+    size_t bytes = 0;
+    const uint32_t count = bn_binding_array_length_quick(bindings);
+    for (uint32_t i = 0; i < count; i++) {
+        const bn_binding *binding = bn_binding_array_get_quick(bindings, i);
+        const bn_attrib *value = nullptr;
+        if (!binding)
+            continue;
+        (void)bn_binding_get_attrib(binding, bn_attrib_value, &value);
+        bytes +=
+            BINDING_BYTES + static_cast<size_t>(ts_length(binding->name)) + (value ? value->value_size : 0);
+    }
+    return bytes;
+}
+
+early_change *take_first() {
+    early_change *change = kept.first;
+    if (!change)
+        return nullptr;
+    kept.first = change->next;
+    if (!kept.first)
+        kept.end = &kept.first;
+    return change;
+}
+
+void free_change(early_change *change) {
+    bn_binding_array_release(change->new_values);
+    free(change);
+}
+
+} // namespace
+
+early_changes_scope::early_changes_scope() {
+    kept.end = &kept.first;
+}
+
+early_changes_scope::~early_changes_scope() {
+    while (early_change *change = take_first())
+        free_change(change);
+    kept = {};
+}
+
+bool early_changes_are_kept() {
+    return kept.end != nullptr;
+}
+
+lc_status keep_early_change(bn_binding_array **inout_new_values) {
+    CHECK_CONDITION(early_changes_are_kept());
+    const size_t bytes = size_of(*inout_new_values);
+    if (bytes > EARLY_CHANGES_MAX_BYTES - kept.bytes) {
+        LC_LOG(LC_LOG_ERR, "Configuration change lost: too much has been changed during the start");
+        return LC_NO_SPACE;
+    }
+    early_change *change = static_cast<early_change *>(calloc(1, sizeof *change));
+    CHECK_NULL(change);
+    change->new_values = *inout_new_values;
+    change->time = CONFIG_CHANGE_DURING_START;
+    *inout_new_values = nullptr;
+    *kept.end = change;
+    kept.end = &change->next;
+    kept.bytes += bytes;
+    return LC_OK;
+}
+
+void early_changes_are_answered() {
+    for (early_change *change = kept.first; change; change = change->next)
+        change->time = CONFIG_CHANGE_IN_ANSWER;
+}
+
+void apply_early_changes() {
+    while (early_change *change = take_first()) {
+        LOG_STATUS(wccpd_config_apply(change->new_values, change->time));
+        free_change(change);
+    }
+}
