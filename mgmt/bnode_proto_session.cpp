@@ -177,21 +177,33 @@ static const char *kind_word(uint16_t type) {
     return kind_words[(type - 1) / 2];
 }
 
+// The frame's type says how the body is read; the callback is that of the message's own type. False, with a
+// line, when one of them is no type at all.
+static bool check_types(gcl_session *session, uint16_t mtype, uint16_t msg_type) {
+    for (const uint16_t type : {mtype, msg_type}) {
+        if (type >= bn_msg_query_request && type <= bn_msg_event_ack)
+            continue;
+        LC_LOG(LC_LOG_ERR, "session %d: proto bnode: invalid body message type %d",
+               gcl_session_get_id(session), type);
+        return false;
+    }
+    return true;
+}
+
 static lc_status receive_request(gcl_session *session, uint16_t mtype, tbuffer **inout_frame) {
     owned_request msg;
     CHECK_STATUS(bn_request_msg_deserialize(*inout_frame, BN_FRAME_HEADER_BYTES, &msg.pointer));
     bn_request_msg_dump(session, msg.pointer, -1, "RECV REQ");
     (void)tb_free(inout_frame);
-    const int32_t id = gcl_session_get_id(session);
-    if (mtype < bn_msg_query_request || mtype > bn_msg_event_ack) {
-        LC_LOG(LC_LOG_ERR, "session %d: proto bnode: invalid body message type %d", id, mtype);
+    const uint16_t type = msg.pointer->msg_type;
+    if (!check_types(session, mtype, type))
         return LC_OK;
-    }
     const bn_session_state *state = session_state(session);
     CHECK_NULL(state);
-    const bn_callback callback = state->callbacks[mtype];
+    const bn_callback callback = state->callbacks[type];
     if (!callback.request) {
-        LC_LOG(LC_LOG_WARNING, "session %d: proto bnode: no %s request callback", id, kind_word(mtype));
+        LC_LOG(LC_LOG_WARNING, "session %d: proto bnode: no %s request callback", gcl_session_get_id(session),
+               kind_word(type));
         return LC_OK;
     }
     (void)callback.request(session, msg.pointer, callback.data);
@@ -214,13 +226,16 @@ static lc_status receive_response(gcl_session *session, uint16_t mtype, tbuffer 
     CHECK_STATUS(bn_response_msg_deserialize(*inout_frame, BN_FRAME_HEADER_BYTES, &msg.pointer));
     bn_response_msg_dump(session, msg.pointer, -1, "RECV RESP");
     (void)tb_free(inout_frame);
+    const uint16_t type = msg.pointer->msg_type;
+    if (!check_types(session, mtype, type))
+        return LC_OK;
     const bn_session_state *state = session_state(session);
     CHECK_NULL(state);
-    const bn_callback callback = state->callbacks[mtype];
+    const bn_callback callback = state->callbacks[type];
     if (!callback.response) {
         const char *text = msg.pointer->return_message ? ts_str(msg.pointer->return_message) : "";
         LC_LOG(LC_LOG_WARNING, "session %d: proto bnode: no %s response callback: code = %d msg = %s", id,
-               kind_word(mtype), static_cast<int>(msg.pointer->return_code), text);
+               kind_word(type), static_cast<int>(msg.pointer->return_code), text);
         return LC_OK;
     }
     (void)callback.response(session, msg.pointer, callback.data);

@@ -8,6 +8,7 @@
 //
 // The interests of a round are a copy, and a callback may take away what a later entry of the copy stands
 // for. That does no harm: their functions look at the session, which outlives its interests.
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstdlib>
@@ -28,13 +29,20 @@ struct watched_state {
     uint64_t frames_sent, frames_received;
     int32_t session_state, protocol_state;
 };
+// A timer of the interest list, armed anew whenever its delay is seen to change.
+struct seen_timer {
+    uint32_t id;
+    int64_t delay, due_ms; // by lt_monotonic_ms
+    bool called;
+};
 struct blocking_wait {
     gcl *instance;
     gcl_session *session;
     bool on_sent, on_received, on_session_state, on_protocol_state;
     uint16_t protocol;
     int64_t timeout_ms, started_ms; // negative timeout: no limit
-    uint32_t timers_told;           // timers up to this id have had their call
+    seen_timer *timers;             // owned by the operation
+    uint32_t timer_count;
 };
 
 } // namespace
@@ -86,20 +94,53 @@ static int64_t time_left(blocking_wait *wait) {
     return left < 0 ? -2 : left;
 }
 
-// Calls the timers that are due, each once in a wait, and gives the time to the next one (-1: none).
+static void forget_deleted_timers(blocking_wait *wait, const fdic_event_array *events) {
+    for (uint32_t i = wait->timer_count; i-- > 0;) {
+        fdic_event key{};
+        key.id = wait->timers[i].id;
+        if (fdic_event_array_binary_search(events, &key, nullptr) != LC_OK)
+            wait->timers[i] = wait->timers[--wait->timer_count];
+    }
+}
+
+// The wait's record of a timer, which runs from when it was first seen.
+static lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t now, seen_timer **out) {
+    uint32_t at = 0;
+    while (at < wait->timer_count && wait->timers[at].id != event->id)
+        at++;
+    if (at == wait->timer_count) {
+        auto *larger =
+            static_cast<seen_timer *>(realloc(wait->timers, (size_t{at} + 1) * sizeof(seen_timer)));
+        CHECK_NULL(larger);
+        wait->timers = larger;
+        wait->timers[wait->timer_count++] = {event->id, -1, 0, false};
+    }
+    seen_timer *timer = &wait->timers[at];
+    if (timer->delay != event->delay)
+        *timer = {event->id, event->delay, now + std::min(event->delay, INT64_MAX - now), false};
+    *out = timer;
+    return LC_OK;
+}
+
+// Calls the timers that are due, each once, and gives the time to the next one (-1: none).
 static lc_status run_timers(blocking_wait *wait, const fdic_event_array *events, int64_t *out_next) {
-    const int64_t passed = lt_curr_time_ms() - wait->started_ms;
+    const int64_t now = lt_monotonic_ms();
     *out_next = -1;
+    forget_deleted_timers(wait, events);
     for (uint32_t i = 0; i < fdic_event_array_length_quick(events); i++) {
         const fdic_event *event = fdic_event_array_get_quick(events, i);
-        if (!event->has_timer || event->delay < 0 || event->id <= wait->timers_told)
+        if (!event->has_timer || event->delay < 0)
             continue;
-        if (event->delay > passed) {
-            const int64_t left = event->delay - passed;
+        seen_timer *timer = nullptr;
+        CHECK_STATUS(see_timer(wait, event, now, &timer));
+        if (timer->called)
+            continue;
+        if (timer->due_ms > now) {
+            const int64_t left = timer->due_ms - now;
             *out_next = *out_next < 0 || left < *out_next ? left : *out_next;
             continue;
         }
-        wait->timers_told = event->id;
+        timer->called = true;
         LC_LOG(LC_LOG_INFO, "GCL timeout forced");
         CHECK_STATUS(
             event->timer_function(event->fd, FDIC_TIMER_EXPIRED, event->user_data, event->timer_argument));
@@ -188,19 +229,22 @@ lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int st
     CHECK_NULL(instance);
     CHECK_NULL(session);
     const gcl_session_guard guard(session);
-    blocking_wait wait = {instance,
-                          session,
-                          stop_on_frames_sent != 0,
-                          stop_on_frames_received != 0,
-                          stop_on_session_state != 0,
-                          stop_on_protocol_state != 0,
-                          protocol,
-                          timeout_ms,
-                          lt_curr_time_ms(),
-                          0};
+    blocking_wait wait = {};
+    wait.instance = instance;
+    wait.session = session;
+    wait.on_sent = stop_on_frames_sent != 0;
+    wait.on_received = stop_on_frames_received != 0;
+    wait.on_session_state = stop_on_session_state != 0;
+    wait.on_protocol_state = stop_on_protocol_state != 0;
+    wait.protocol = protocol;
+    wait.timeout_ms = timeout_ms;
+    wait.started_ms = lt_curr_time_ms();
     bool stop = false;
-    while (!stop)
-        CHECK_QUIET(wait_round(&wait, &stop));
+    lc_status status = LC_OK;
+    while (!stop && status == LC_OK)
+        status = wait_round(&wait, &stop);
+    free(wait.timers);
+    CHECK_QUIET(status);
     return LC_OK;
 }
 

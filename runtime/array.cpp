@@ -11,6 +11,7 @@
 #include <cstring>
 
 #include "runtime/array_index.h"
+#include "runtime/guards.h"
 #include "runtime/logging.h"
 
 int array_std_compare_func(const void *a, const void *b) {
@@ -70,22 +71,23 @@ lc_status array_options_set(array *list, const array_options *options) {
     return LC_OK;
 }
 
+static void release_record(array *list) {
+    free(list);
+}
+
 lc_status array_new(array **out, const array_options *options) {
     CHECK_NULL(out);
     *out = nullptr;
     array_options defaults;
     CHECK_STATUS(array_options_get_defaults(&defaults));
-    auto *list = static_cast<array *>(calloc(1, sizeof(array)));
-    CHECK_NULL(list);
-    (void)array_options_set(list, options ? options : &defaults);
-    list->elements = static_cast<void **>(calloc(list->initial_size, sizeof(void *)));
-    if (!list->elements) {
-        free(list);
-        FAIL_WITH(LC_NULL);
-    }
-    list->capacity = list->initial_size;
-    list->sorted = 1;
-    *out = list;
+    owned<array, release_record> list(static_cast<array *>(calloc(1, sizeof(array))));
+    CHECK_NULL(list.pointer);
+    (void)array_options_set(list.pointer, options ? options : &defaults);
+    list.pointer->elements = static_cast<void **>(calloc(list.pointer->initial_size, sizeof(void *)));
+    CHECK_NULL(list.pointer->elements);
+    list.pointer->capacity = list.pointer->initial_size;
+    list.pointer->sorted = 1;
+    *out = list.take();
     return LC_OK;
 }
 
@@ -201,13 +203,13 @@ lc_status array_set_takeover(array *list, uint32_t index, void **inout_element) 
     array_index_drop(list);
     while (list->length <= index)
         list->elements[list->length++] = nullptr;
+    list->sorted = 0;
     void *old = list->elements[index];
     if (old == *inout_element) {
         *inout_element = nullptr;
         return LC_OK;
     }
     CHECK_STATUS(list->takeover(inout_element, &list->elements[index]));
-    list->sorted = 0;
     give(list, old);
     return LC_OK;
 }

@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "runtime/guards.h"
 #include "runtime/logging.h"
 
 // ---- Hash: Jenkins' lookup2 over the key's bytes
@@ -77,6 +78,13 @@ static ht_entry **new_buckets(uint32_t count) {
     return static_cast<ht_entry **>(calloc(count, sizeof(ht_entry *)));
 }
 
+static void release_record(ht *table) {
+    free(table);
+}
+static void release_entry(ht_entry *entry) {
+    free(entry);
+}
+
 lc_status ht_new(ht **out, const ht_options *options) {
     CHECK_NULL(out);
     *out = nullptr;
@@ -84,13 +92,11 @@ lc_status ht_new(ht **out, const ht_options *options) {
     ht_default_options(&defaults);
     if (!options)
         options = &defaults;
-    auto *table = static_cast<ht *>(calloc(1, sizeof(ht)));
+    owned<ht, release_record> made(static_cast<ht *>(calloc(1, sizeof(ht))));
+    ht *table = made.pointer;
     CHECK_NULL(table);
     table->buckets = new_buckets(ht_table_size_initial);
-    if (!table->buckets) {
-        free(table);
-        FAIL_WITH(LC_NULL);
-    }
+    CHECK_NULL(table->buckets);
     table->bucket_count = ht_table_size_initial;
     table->refuse_duplicates = options->refuse_duplicates;
     table->hash_function = options->hash_function ? options->hash_function : defaults.hash_function;
@@ -99,7 +105,7 @@ lc_status ht_new(ht **out, const ht_options *options) {
     table->insert_function = options->insert_function;
     table->user_word = options->user_word;
     table->free_function = options->free_function;
-    *out = table;
+    *out = made.take();
     return LC_OK;
 }
 
@@ -200,28 +206,18 @@ lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value)
     CHECK_NULL(table);
     CHECK_NULL(key);
     const uint32_t length = length_of(key, key_length);
-    ht_entry **link = find(table, key, length);
-    if (*link && table->refuse_duplicates)
+    if (table->refuse_duplicates && *find(table, key, length))
         return LC_EXISTS;
-    auto *entry = static_cast<ht_entry *>(calloc(1, sizeof(ht_entry)));
-    CHECK_NULL(entry);
-    *entry = {const_cast<void *>(key), length, value, nullptr};
-    if (table->insert_function) {
-        const lc_status status =
-            table->insert_function(key, length, value, table->user_word, &entry->key, &entry->value);
-        if (status != LC_OK)
-            free(entry);
-        CHECK_STATUS(status);
-    }
-    lc_status old_status = LC_OK;
-    if (*link)
-        old_status = drop(table, link);
-    while (*link)
-        link = &(*link)->next;
-    *link = entry;
+    owned<ht_entry, release_entry> entry(static_cast<ht_entry *>(calloc(1, sizeof(ht_entry))));
+    CHECK_NULL(entry.pointer);
+    *entry.pointer = {const_cast<void *>(key), length, value, nullptr};
+    CHECK_STATUS(ht_delete(table, key, key_length));
+    if (table->insert_function)
+        CHECK_STATUS(table->insert_function(key, length, value, table->user_word, &entry.pointer->key,
+                                            &entry.pointer->value));
+    *find(table, key, length) = entry.take(); // the end of its chain
     table->entry_count++;
     fit(table);
-    LOG_STATUS(old_status); // the old entry is gone and the new one stands
     return LC_OK;
 }
 lc_status ht_lookup(const ht *table, const void *key, int32_t key_length, int *out_found, void **out_key,

@@ -54,7 +54,9 @@ int ht_key_equal_string_func(const void *a, uint32_t a_length, const void *b, ui
 lc_status ht_new(ht **out, const ht_options *options);
 lc_status ht_empty(ht *table);
 lc_status ht_free(ht **inout);
-// A key length of -1 takes strlen. LC_EXISTS when duplicates are refused; else the old entry is deleted.
+// A key length of -1 takes strlen. LC_EXISTS when duplicates are refused; else an old entry is deleted before
+// the new one is made. When its free function fails the result is LC_GENERIC: the old entry has gone, and key
+// and value stay the caller's.
 lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value);
 // A missing key gives 0 and `out_found` 0, with key length -1. Outs may be null.
 lc_status ht_lookup(const ht *table, const void *key, int32_t key_length, int *out_found, void **out_key,

@@ -71,7 +71,8 @@ lc_status lt_time_sec_to_timeval(lt_time_sec seconds, timeval *out) {
 }
 lc_status lt_time_ms_to_timeval(lt_time_ms ms, timeval *out) {
     CHECK_NULL(out);
-    *out = {ms / 1000, (ms % 1000) * US_PER_MS};
+    const int64_t rest = ms % 1000; // the microseconds of a timeval are never negative
+    *out = {ms / 1000 - (rest < 0), (rest < 0 ? rest + 1000 : rest) * US_PER_MS};
     return LC_OK;
 }
 lt_time_sec lt_timeval_to_time_sec(const timeval *value) {

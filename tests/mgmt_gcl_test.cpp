@@ -206,6 +206,25 @@ TEST_F(Gcl, APeerThatNeverAnswersOrGoes) {
     EXPECT_EQ(client.closes, 1);
 }
 
+// Each timer of the interest list runs once in a wait, when it is due, in whatever order they were
+// registered.
+TEST_F(Gcl, TimersRunInAWait) {
+    connect();
+    std::vector<intptr_t> ran;
+    const auto note = [](int, uint32_t kind, void *data, void *argument) -> lc_status {
+        EXPECT_EQ(kind, FDIC_TIMER_EXPIRED);
+        static_cast<std::vector<intptr_t> *>(data)->push_back(reinterpret_cast<intptr_t>(argument));
+        return LC_OK;
+    };
+    int32_t id = 0;
+    for (const intptr_t delay : {80, 30, 0})
+        ASSERT_EQ(
+            fdic_event_add_timer(client.interests, delay, &ran, note, reinterpret_cast<void *>(delay), &id),
+            LC_OK);
+    EXPECT_EQ(client.open(200), LC_IO_TIMED_OUT);
+    EXPECT_EQ(ran, (std::vector<intptr_t>{0, 30, 80}));
+}
+
 // The signals that end the process are blocked in the thread that waits; one that comes ends the attempts.
 TEST_F(Gcl, ConnectingEndsWithTheProcess) {
     sigset_t end;

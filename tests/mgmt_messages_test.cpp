@@ -306,6 +306,10 @@ TEST_F(MessageSession, WhatNobodyTakesIsTold) {
         {0, message(0), "session 1: proto bnode: invalid body message type 0"},
         {9, message(9), "session 1: proto bnode: invalid body message type 9"},
         {10, message(10), "session 1: proto bnode: invalid body message type 10"},
+        {7, message(9), "session 1: proto bnode: invalid body message type 9"},
+        {9, message(7), "session 1: proto bnode: invalid body message type 9"},
+        {2, response(10, u32(0) + str("") + u32(0)), "session 1: proto bnode: invalid body message type 10"},
+        {2, response(7, u32(0) + str("told") + u32(0)), "no event response callback: code = 0 msg = told"},
         {2, wire("\x00\x03", 2) + message(2).substr(2), "session 1: service 3 not open: 2"},
     };
     for (const auto &row : cases) {
@@ -314,8 +318,9 @@ TEST_F(MessageSession, WhatNobodyTakesIsTold) {
         log.clear();
     }
     bn_set_session_callback_query_request_msg(with.session, note, this);
-    EXPECT_TRUE(receive(1, message(1)));
-    EXPECT_EQ(calls, "1 ");
+    for (const uint32_t frame_type : {1u, 3u}) // the message's own type decides
+        EXPECT_TRUE(receive(frame_type, message(1)));
+    EXPECT_EQ(calls, "1 1 ");
     EXPECT_FALSE(receive(7, request(7, str("") + u32(0) + u32(9) + "cut")));
     EXPECT_GE(log.count("Error code 14011"), 1);
     EXPECT_EQ(log.count("session 1: closing after error condition"), 1);

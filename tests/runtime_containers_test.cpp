@@ -50,6 +50,11 @@ TEST(Arrays, CapacityAndPlaces) {
     EXPECT_TRUE(list->length == 14 && !list->sorted);
     EXPECT_EQ(array_get_quick(list, 11), nullptr);
     EXPECT_EQ(array_get_quick(list, 13), &places[20]);
+    list->sorted = 1;
+    element = nullptr;
+    EXPECT_EQ(array_set_takeover(list, 15, &element), LC_OK); // nulls are in no order either
+    EXPECT_TRUE(list->length == 16 && !list->sorted);
+    element = &places[20];
     EXPECT_EQ(array_set_takeover(list, 0xffffffff, &element), LC_ASSERTION);
     EXPECT_EQ(array_append(list, &places[0]), LC_ASSERTION); // no function to copy it
     EXPECT_EQ(array_empty(list), LC_OK);
@@ -240,6 +245,31 @@ TEST(Arrays, IndexSparesComparisons) {
     EXPECT_LT(compared, 10 * store.size());
 }
 
+// ---- Memory that runs out
+
+#ifndef WCCP_SANITIZED
+static int failing_calloc; // counts down to the call that fails
+extern "C" void *__libc_calloc(size_t count, size_t size);
+extern "C" void *calloc(size_t count, size_t size) {
+    return failing_calloc > 0 && --failing_calloc == 0 ? nullptr : __libc_calloc(count, size);
+}
+TEST(Memory, EachAllocationFailsWithTheSameLine) {
+    log_lines log;
+    for (const int call : {1, 2}) {
+        array_owner list;
+        table_owner table;
+        failing_calloc = call;
+        EXPECT_EQ(array_new(&list, nullptr), LC_NULL);
+        failing_calloc = call;
+        EXPECT_EQ(ht_new(&table, nullptr), LC_NULL);
+        const std::string lines = log.take();
+        for (const char *place : {"array_new(), array.cpp:", "ht_new(), hash_table.cpp:"})
+            EXPECT_NE(lines.find(place), std::string::npos) << lines;
+        EXPECT_EQ(lines.find("forced"), std::string::npos) << lines;
+    }
+}
+#endif
+
 // ---- Hash table
 
 TEST(HashTable, PublishedHash) {
@@ -308,9 +338,22 @@ TEST(HashTable, DuplicatesMissesAndFailingFrees) {
     EXPECT_TRUE(counted.freed == 1 && table->entry_count == 1);
     EXPECT_EQ(ht_lookup(table, "kx", 1, &found, nullptr, &length, &value), LC_OK);
     EXPECT_TRUE(length == 1 && value == &two);
+    // The old entry goes before the new one is made.
+    table->insert_function = [](const void *key, uint32_t, void *made, void *user_word, void **out_key,
+                                void **out_value) -> lc_status {
+        *out_key = const_cast<void *>(key);
+        *out_value = made;
+        return static_cast<counted_table *>(user_word)->freed == 2 ? LC_OK : LC_IO_ERROR;
+    };
+    EXPECT_EQ(ht_insert(table, "k", -1, &one), LC_OK);
     table->refuse_duplicates = 1;
     EXPECT_EQ(ht_insert(table, "k", -1, &one), LC_EXISTS);
+    table->refuse_duplicates = 0;
     counted.status = LC_IO_ERROR;
+    EXPECT_EQ(ht_insert(table, "k", -1, &one), LC_GENERIC);
+    EXPECT_TRUE(counted.freed == 3 && table->entry_count == 0);
+    table->insert_function = nullptr;
+    EXPECT_EQ(ht_insert(table, "k", -1, &one), LC_OK);
     EXPECT_EQ(ht_delete(table, "k", -1), LC_GENERIC);
     EXPECT_EQ(table->entry_count, 0u);
     EXPECT_EQ(ht_delete(table, "k", -1), LC_OK);

@@ -1,7 +1,9 @@
 #include <gtest/gtest.h>
 
+#include <array>
 #include <cstdlib>
 #include <string>
+#include <vector>
 
 #include "runtime/ttime.h"
 #include "tests/support/owners.h"
@@ -54,6 +56,18 @@ TEST_F(Time, FromText) {
         EXPECT_EQ(lt_str_to_date(bad, &date), LC_BAD_TYPE) << bad;
     for (const char *bad : {"25:00", "1:2:3 x", "1:2:3.x", "1:2:3.5e3", "", "01"})
         EXPECT_EQ(lt_str_to_daytime_us(bad, &us), LC_BAD_TYPE) << bad;
+}
+
+TEST_F(Time, TimevalsAreValid) {
+    for (const auto &[ms, seconds, us] :
+         std::vector<std::array<int64_t, 3>>{{-1, -1, 999000},
+                                             {-2000, -2, 0},
+                                             {1250, 1, 250000},
+                                             {INT64_MIN, INT64_MIN / 1000 - 1, 192000}}) {
+        timeval value{};
+        EXPECT_EQ(lt_time_ms_to_timeval(ms, &value), LC_OK);
+        EXPECT_TRUE(value.tv_sec == seconds && value.tv_usec == us) << ms;
+    }
 }
 
 // What was written reads back, to the microsecond.
