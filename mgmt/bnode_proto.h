@@ -44,6 +44,8 @@ enum : uint32_t {
 };
 constexpr uint16_t BN_PROTO = 2;
 constexpr uint32_t BN_FRAME_HEADER_BYTES = 32;
+// The words of the LC_NO_BUFFER_SPACE that a query gets whose answer is larger than a frame.
+constexpr const char *BN_TOO_LARGE = "The answer is larger than a message: ask for less";
 
 extern const lc_enum_entry bn_msg_type_table[];
 extern const lc_enum_entry bn_query_subop_table[];
@@ -159,7 +161,9 @@ lc_status bn_response_get(const bn_response_msg *msg, uint32_t *out_code, tstrin
                           int keep_parts, bn_binding_array **out_bindings, uint32_array **out_node_ids);
 lc_status bn_query_response_msg_get_db_revision_id(const bn_response_msg *msg, uint32_t *out_revision);
 
-// Sending. A request to a session that is not connected vanishes with result 0.
+// Sending. A request to a session that is not connected vanishes with result 0. Instead of a response that
+// does not fit a frame or the session's queue its asker gets one of the same type, without bindings, with
+// LC_NO_BUFFER_SPACE and words.
 lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg);
 lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg);
 lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, tbuffer **out);

@@ -159,15 +159,39 @@ static lc_status send_message(gcl_session *session, Message *msg) {
                gcl_session_get_id(session));
         return LC_OK;
     }
-    CHECK_STATUS(gcl_session_send_frame_components_tb(session, BN_PROTO, msg->msg_type, BN_FRAME_HEADER_BYTES,
-                                                      &buffer.pointer));
+    const lc_status status = gcl_session_send_frame_components_tb(session, BN_PROTO, msg->msg_type,
+                                                                  BN_FRAME_HEADER_BYTES, &buffer.pointer);
+    if (status == LC_NO_BUFFER_SPACE)
+        CHECK_QUIET(status); // larger than a frame, which has its line
+    CHECK_STATUS(status);
     return LC_OK;
 }
+
+// Instead of an answer that did not fit: a peer that hears nothing would wait until its time is over.
+static lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, lc_status reason) {
+    owned_response refusal;
+    CHECK_STATUS(bn_response_msg_create(&refusal.pointer, msg->msg_type, msg->response_to, LC_NO_BUFFER_SPACE,
+                                        reason == LC_NO_BUFFER_SPACE
+                                            ? BN_TOO_LARGE
+                                            : "The queue of the session is full: ask for less, or later"));
+    refusal.pointer->service_id = msg->service_id;
+    refusal.pointer->msg_id = msg->msg_id;
+    refusal.pointer->transaction_id = msg->transaction_id;
+    owned_tbuffer buffer;
+    CHECK_STATUS(bn_response_msg_serialize(refusal.pointer, BN_FRAME_HEADER_BYTES, &buffer.pointer));
+    bn_response_msg_dump(session, refusal.pointer, LC_LOG_DEBUG, response_kind::title);
+    CHECK_STATUS(gcl_session_send_refusal_tb(session, BN_PROTO, msg->msg_type, &buffer.pointer));
+    return LC_OK;
+}
+
 lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg) {
     return send_message<request_kind>(session, msg);
 }
 lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg) {
-    return send_message<response_kind>(session, msg);
+    const lc_status status = send_message<response_kind>(session, msg);
+    if (status != LC_NO_BUFFER_SPACE && status != LC_CANCELLED)
+        return status;
+    return send_refusal(session, msg, status);
 }
 
 // ---- Receiving

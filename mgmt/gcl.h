@@ -30,6 +30,8 @@ constexpr uint32_t GCL_FRAME_MAX = 16u << 20;
 // What a session keeps for a peer that doesn't read. A frame that would go past it is not taken, unless
 // nothing waits.
 constexpr uint64_t GCL_QUEUE_MAX_BYTES = 4u << 20;
+// What is kept beyond that for refusals, so that a peer hears of an answer that did not fit.
+constexpr uint64_t GCL_QUEUE_RESERVE_BYTES = 64u << 10;
 
 enum : int32_t {
     GCL_SESSION_NONE = 0,
@@ -76,12 +78,17 @@ lc_status gcl_session_client_open_service_blocking(gcl_session *session, uint16_
 lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int stop_on_frames_sent,
                                      int stop_on_frames_received, int stop_on_session_state,
                                      int stop_on_protocol_state, uint16_t protocol, int64_t timeout_ms);
-// A full output queue gives LC_CANCELLED; one line of the log tells it for all frames lost in one filling.
+// A frame of more than GCL_FRAME_MAX gives LC_NO_BUFFER_SPACE, with a line. A full output queue gives
+// LC_CANCELLED; one line of the log stands for all frames lost in one filling.
 lc_status gcl_session_send_frame_components(gcl_session *session, uint16_t proto, uint16_t mtype,
                                             uint32_t length, const void *body);
 // The buffer has room for the header at its start; it is taken over, also on failure.
 lc_status gcl_session_send_frame_components_tb(gcl_session *session, uint16_t proto, uint16_t mtype,
                                                uint32_t header_bytes, tbuffer **inout_buffer);
+// The same, with a header of GCL_HEADER_BYTES, for a short frame instead of an answer that did not fit: it
+// may use GCL_QUEUE_RESERVE_BYTES as well.
+lc_status gcl_session_send_refusal_tb(gcl_session *session, uint16_t proto, uint16_t mtype,
+                                      tbuffer **inout_buffer);
 lc_status gcl_session_close(gcl_session *session, int flush);
 // Not from another thread than the loop's while the loop runs.
 lc_status gcl_session_free(gcl_session **inout);

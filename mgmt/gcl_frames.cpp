@@ -13,7 +13,7 @@
 // The output queue is bounded in bytes. A frame that would go past the bound is not taken; the first one is
 // told in the log, the rest of that filling counted and told when the queue has drained to half. The frame's
 // sender gets LC_CANCELLED: nothing waits for an answer to a frame that never went, and nothing writes a line
-// for each.
+// for each. An answer that is not taken is replaced by a refusal, for which the queue keeps a reserve.
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -65,10 +65,14 @@ static lc_status check_sendable(const gcl_session *session) {
     return LC_GENERIC;
 }
 
-// Whether the queue takes a frame of this length.
-static lc_status check_room(gcl_session *session, uint64_t total) {
-    CHECK_CONDITION(total <= GCL_FRAME_MAX);
-    if (!session->queued_bytes || session->queued_bytes + total <= GCL_QUEUE_MAX_BYTES)
+// Whether the queue, of that size, takes a frame of this length.
+static lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue_max) {
+    if (total > GCL_FRAME_MAX) {
+        LC_LOG(LC_LOG_WARNING, "session %d: message of %llu bytes does not fit a frame", session->id,
+               static_cast<unsigned long long>(total));
+        return LC_NO_BUFFER_SPACE;
+    }
+    if (!session->queued_bytes || session->queued_bytes + total <= queue_max)
         return LC_OK;
     if (!session->frames_lost++)
         LC_LOG(LC_LOG_WARNING,
@@ -105,9 +109,10 @@ static lc_status queue_frame(gcl_session *session, tbuffer **inout_buffer, uint3
 }
 
 // Puts the header into the room at the start of the buffer and takes the buffer over.
-static lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtype, tbuffer **inout_buffer) {
+static lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtype, tbuffer **inout_buffer,
+                             uint64_t queue_max = GCL_QUEUE_MAX_BYTES) {
     const auto total = static_cast<uint32_t>(tb_length(*inout_buffer));
-    CHECK_QUIET(check_room(session, total));
+    CHECK_QUIET(check_room(session, total, queue_max));
     const uint32_t sequence = session->sequence++;
     fill_header(tb_buf(*inout_buffer), sequence, proto, mtype, total);
     CHECK_STATUS(queue_frame(session, inout_buffer, sequence));
@@ -126,7 +131,7 @@ lc_status gcl_session_send_frame_components(gcl_session *session, uint16_t proto
     CHECK_STATUS(tb_append_buf(buffer.pointer, header, sizeof header));
     if (length)
         CHECK_STATUS(tb_append_buf(buffer.pointer, body, length));
-    CHECK_STATUS(send_buffer(session, proto, mtype, &buffer.pointer));
+    CHECK_QUIET(send_buffer(session, proto, mtype, &buffer.pointer));
     return LC_OK;
 }
 
@@ -146,7 +151,21 @@ lc_status gcl_session_send_frame_components_tb(gcl_session *session, uint16_t pr
         return LC_OK;
     }
     CHECK_CONDITION(tb_length(buffer.pointer) >= static_cast<int32_t>(GCL_HEADER_BYTES));
-    CHECK_STATUS(send_buffer(session, proto, mtype, &buffer.pointer));
+    CHECK_QUIET(send_buffer(session, proto, mtype, &buffer.pointer));
+    return LC_OK;
+}
+
+lc_status gcl_session_send_refusal_tb(gcl_session *session, uint16_t proto, uint16_t mtype,
+                                      tbuffer **inout_buffer) {
+    CHECK_NULL(inout_buffer);
+    gcl_owned_buffer buffer(*inout_buffer);
+    *inout_buffer = nullptr;
+    CHECK_NULL(session);
+    CHECK_CONDITION(tb_length(buffer.pointer) >= static_cast<int32_t>(GCL_HEADER_BYTES));
+    const gcl_session_guard guard(session);
+    CHECK_QUIET(check_sendable(session));
+    CHECK_QUIET(
+        send_buffer(session, proto, mtype, &buffer.pointer, GCL_QUEUE_MAX_BYTES + GCL_QUEUE_RESERVE_BYTES));
     return LC_OK;
 }
 

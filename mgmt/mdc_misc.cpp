@@ -87,6 +87,12 @@ uint32_t mdc_remote_reg_get_cap_mask(const mdc_remote_reg *record) {
 
 namespace {
 
+// What an answer has come to. A walk that finds more than a frame holds ends early: nobody gets it, and this
+// process may have its memory locked.
+struct mon_answer {
+    uint64_t bytes;
+    bool too_large;
+};
 struct mon_walk {
     tree *registered;
     uint32_t flags;
@@ -95,11 +101,34 @@ struct mon_walk {
     mdc_mon_iterate_function iterate;
     void *iterate_data;
     bn_binding_array *found;
+    mon_answer *answer;
 };
 
 } // namespace
 
 static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth);
+
+// The bytes of a binding in a message, a little more for a name with escapes.
+static uint64_t wire_bytes(const bn_binding *binding) {
+    constexpr uint64_t NODE_BYTES = 13, PART_BYTES = 4, ATTRIBUTE_BYTES = 20;
+    uint64_t bytes = NODE_BYTES;
+    const char *name = bn_binding_get_name_quick(binding);
+    for (; name && *name; name++)
+        bytes += *name == '/' ? PART_BYTES : 1;
+    const bn_attrib *value = nullptr;
+    if (bn_binding_get_attrib(binding, bn_attrib_value, &value) == LC_OK && value)
+        bytes += ATTRIBUTE_BYTES + value->value_size;
+    return bytes;
+}
+
+static lc_status get_node(const mon_walk *walk, const char *name, const tstr_array *parts) {
+    uint32_t at = bn_binding_array_length_quick(walk->found);
+    CHECK_STATUS(walk->get(name, parts, walk->get_data, walk->found));
+    for (; at < bn_binding_array_length_quick(walk->found); at++)
+        walk->answer->bytes += wire_bytes(bn_binding_array_get_quick(walk->found, at));
+    walk->answer->too_large = walk->answer->bytes > GCL_FRAME_MAX;
+    return LC_OK;
+}
 
 static lc_status walk_child(const mon_walk *walk, tstr_array *parts, const char *child, uint32_t depth) {
     owned_tstring name;
@@ -155,7 +184,7 @@ static lc_status walk_children(const mon_walk *walk, tstr_array *parts, tree_nod
 }
 
 static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth) {
-    if (depth >= 2 && !(walk->flags & bn_qf_subtree))
+    if ((depth >= 2 && !(walk->flags & bn_qf_subtree)) || walk->answer->too_large)
         return LC_OK;
     owned_tstring name;
     CHECK_STATUS(bn_binding_name_parts_to_name_tstr(parts, 1, &name.pointer));
@@ -173,7 +202,7 @@ static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array 
         uint32_t children = 0;
         CHECK_STATUS(tree_node_get_num_children(walk->registered, node, &children));
         if (!(walk->flags & bn_qf_walk_only) && (!(walk->flags & bn_qf_leaves_only) || children == 0))
-            CHECK_STATUS(walk->get(text, parts, walk->get_data, walk->found));
+            CHECK_STATUS(get_node(walk, text, parts));
     }
     return walk_children(walk, parts, node, depth + 1);
 }
@@ -208,7 +237,7 @@ static lc_status answer_node(const mon_walk *walk, const bn_node_info *info, con
     CHECK_STATUS(bn_binding_get_name_parts(binding, &parts.pointer));
     switch (info->subop) {
     case bn_query_get:
-        CHECK_STATUS(walk->get(name, parts.pointer, walk->get_data, walk->found));
+        CHECK_STATUS(get_node(walk, name, parts.pointer));
         return LC_OK;
     case bn_query_iterate:
         CHECK_STATUS(mdc_mon_iterate_node_internal(walk, parts.pointer, 0));
@@ -229,6 +258,14 @@ static lc_status move_to_response(bn_response_msg *response, bn_binding_array *f
             CHECK_STATUS(bn_query_response_msg_append_binding_takeover(response, &binding.pointer, node_id));
     }
     CHECK_STATUS(bn_binding_array_empty(found));
+    return LC_OK;
+}
+
+static lc_status refuse_large_answer(const bn_request_msg *request, bn_response_msg **inout_response) {
+    CHECK_STATUS(bn_response_msg_free(inout_response));
+    CHECK_STATUS(bn_query_response_msg_create(inout_response,
+                                              static_cast<uint32_t>(bn_request_get_msg_id(request)),
+                                              LC_NO_BUFFER_SPACE, BN_TOO_LARGE));
     return LC_OK;
 }
 
@@ -262,15 +299,18 @@ lc_status mdc_dispatch_mon_request(gcl_session *session, bn_request_msg *request
         if (info.pointer[i].subop == bn_query_registration_info)
             CHECK_STATUS(
                 add_registration(registered.pointer, bn_binding_array_get_quick(bindings.pointer, i)));
-    for (uint32_t i = 0; i < count; i++) {
+    mon_answer answer = {};
+    for (uint32_t i = 0; i < count && !answer.too_large; i++) {
         if (info.pointer[i].subop == bn_query_registration_info)
             continue;
-        const mon_walk walk = {registered.pointer, info.pointer[i].flags, get, get_data, iterate,
-                               iterate_data,       found.pointer};
+        const mon_walk walk = {registered.pointer, info.pointer[i].flags, get,    get_data, iterate,
+                               iterate_data,       found.pointer,         &answer};
         CHECK_STATUS(answer_node(&walk, &info.pointer[i], bn_binding_array_get_quick(bindings.pointer, i)));
         CHECK_STATUS(
             move_to_response(response.pointer, found.pointer, uint32_array_get_quick(ids.pointer, i)));
     }
+    if (answer.too_large)
+        CHECK_STATUS(refuse_large_answer(request, &response.pointer));
     CHECK_STATUS(bn_response_msg_send(session, response.pointer));
     return LC_OK;
 }

@@ -215,6 +215,7 @@ struct monitored {
     owner<bn_request_msg, bn_request_msg_free> request;
     strings asked;
     lc_status failure = 0;
+    std::string value = "v";
 
     monitored() {
         EXPECT_TRUE(with.open());
@@ -237,7 +238,7 @@ struct monitored {
     static lc_status get(const char *name, const tstr_array *, void *data, bn_binding_array *out) {
         auto *self = static_cast<monitored *>(data);
         self->asked.emplace_back(name);
-        add(out, name, "v");
+        add(out, name, self->value.c_str());
         return self->failure;
     }
     static lc_status list(const char *name, const tstr_array *parts, void *data, tstr_array *out) {
@@ -259,6 +260,8 @@ struct monitored {
         EXPECT_EQ(tb_new_buf(&buffer, frame.data(), static_cast<int32_t>(frame.size())), 0);
         EXPECT_EQ(bn_response_msg_deserialize(buffer, 32, &response), 0);
         EXPECT_EQ(response->response_to, request->msg_id);
+        if (response->return_code)
+            got.push_back(std::to_string(response->return_code) + " " + ts_str(response->return_message));
         for (uint32_t i = 0; i < bn_response_per_node_array_length_quick(response->nodes); i++) {
             const bn_response_node *node = bn_response_per_node_array_get_quick(response->nodes, i);
             got.push_back(bn_binding_get_name_quick(node->binding) + (" " + std::to_string(node->node_id)));
@@ -335,6 +338,15 @@ TEST(client, monitoring_answers) {
         EXPECT_EQ(failing.dispatch(), status);
         EXPECT_EQ(failing.answer(), strings{"(none)"});
     }
+    monitored large; // it is not asked for more than a message holds
+    large.value.resize(1 << 20, 'v');
+    large.add_registered({"/a/*", "/a/*/b"});
+    for (int i = 0; i < 14; i++)
+        large.add_node("/one", bn_query_get);
+    large.add_node("/a/*", bn_query_iterate, bn_qf_subtree);
+    ASSERT_EQ(large.dispatch(), 0);
+    EXPECT_EQ(large.answer(), strings{"14011 The answer is larger than a message: ask for less"});
+    EXPECT_EQ(large.asked.size(), 14u + 3);
     monitored empty;
     EXPECT_EQ(empty.dispatch(), LC_ASSERTION);
     empty.request->msg_type = bn_msg_event;

@@ -355,6 +355,41 @@ TEST_F(MessageSession, SentMessagesAreNumbered) {
     EXPECT_EQ(log.count("Dropping response to non-connected session 1"), 1);
 }
 
+// The asker gets a code and words, also when the queue has no room left at all.
+TEST_F(MessageSession, AnAnswerThatDoesNotFitIsRefused) {
+    ASSERT_TRUE(with.open());
+    const auto answer = [&](size_t bytes) {
+        response_owner response;
+        binding_owner binding;
+        ASSERT_EQ(bn_query_response_msg_create(&response, 41, 0, nullptr), 0);
+        ASSERT_EQ(
+            bn_binding_new_str(&binding, "/n", bn_attrib_value, bn_type_str, 0, wire(bytes, 'v').c_str()), 0);
+        ASSERT_EQ(bn_query_response_msg_append_binding_takeover(response, &binding.pointer, 9), 0);
+        EXPECT_EQ(bn_response_msg_send(with.session, response), 0);
+    };
+    const auto expect_refusal = [&](const wire &frame, const wire &words) {
+        EXPECT_EQ(frame.substr(frame.size() < 48 ? 0 : 48),
+                  u32(41) + u32(LC_NO_BUFFER_SPACE) + str(words) + u32(0) + u32(0));
+    };
+    answer(GCL_FRAME_MAX);
+    expect_refusal(with.provider.take_frame(), "The answer is larger than a message: ask for less");
+    EXPECT_EQ(log.count("session 1: message of 167773"), 1);
+
+    size_t waiting = 0;
+    for (const uint32_t size : {65536u, 1u})
+        while (gcl_session_send_frame_components(with.session, 2, 7, size, wire(size, 'q').data()) == 0)
+            waiting++;
+    answer(1);
+    for (size_t i = 0; i < waiting; i++) {
+        wire frame;
+        while ((frame = with.provider.take_frame(0)).empty())
+            (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_WRITABLE, with.session, nullptr);
+        ASSERT_EQ(frame.back(), 'q');
+    }
+    expect_refusal(with.provider.take_frame(), "The queue of the session is full: ask for less, or later");
+    EXPECT_EQ(log.count("Error code"), 0);
+}
+
 TEST_F(MessageSession, WhatIsSentIsDumped) {
     ASSERT_TRUE(with.open());
     ASSERT_EQ(lc_log_set_max_log_level("debug"), 0);
