@@ -197,13 +197,16 @@ struct Mgmtd : testing::Test {
         return bn_request_per_node_array_get_quick(msg->nodes,
                                                    bn_request_per_node_array_length_quick(msg->nodes) - 1);
     }
-    // wccpd's answer, with the state of group 51.
-    void answer(uint32_t peer_id, uint32_t response_to, uint32_t node_id, uint32_t code) {
+    // wccpd's answer.
+    void answer(uint32_t peer_id, uint32_t response_to, uint32_t node_id, uint32_t code,
+                const std::vector<event_field> &fields = {{STATE + "/51/oper", {bn_type_str, "ACTIVE"}}}) {
         owned_response msg;
         owned_tbuffer frame;
-        bn_binding *binding = make_binding(STATE + "/51/oper", {bn_type_str, "ACTIVE"});
         ASSERT_EQ(bn_query_response_msg_create(&msg.pointer, response_to, code, nullptr), LC_OK);
-        ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding, node_id), LC_OK);
+        for (const event_field &field : fields) {
+            bn_binding *binding = make_binding(field.name, field.value);
+            ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding, node_id), LC_OK);
+        }
         msg.pointer->service_id = 2;
         ASSERT_EQ(bn_response_msg_serialize(msg.pointer, 32, &frame.pointer), LC_OK);
         EXPECT_TRUE(server_take_frame(&daemon, peer_id, bn_msg_query_response, frame.pointer));
@@ -606,6 +609,78 @@ TEST_F(Mgmtd, AStateIsAskedForAndTheAnswerPassedOn) {
     EXPECT_EQ(last_response()->response_to, 77u);
     answer(1, asked, node_id, 0);
     EXPECT_EQ(sent.size(), 1u) << "an answer counts once";
+}
+
+// The groups are asked for one after the other, and no longer than the answer fits a message.
+TEST_F(Mgmtd, AWalkOfAllGroupsGoesGroupByGroup) {
+    const auto group = [](int id) {
+        return event_field{STATE + "/" + std::to_string(id), {bn_type_str, std::to_string(id)}};
+    };
+    // Answers what wccpd was asked last; what it was asked for.
+    const auto answer_last = [&](const std::vector<event_field> &fields) {
+        const bn_request_msg *asked = sent.back().request;
+        const bn_request_node *node = last_node(asked);
+        const uint32_t flags = node->flags, node_id = node->node_id, id = asked->msg_id;
+        const std::string name = name_of(node->binding);
+        clear();
+        answer(1, id, node_id, 0, fields);
+        return name + " " + std::to_string(flags);
+    };
+    const std::string whole = " " + std::to_string(bn_qf_subtree | bn_qf_include_self);
+    query(3, "/qv/wccpd/wccp/srv_grp", bn_query_iterate, bn_qf_subtree);
+    EXPECT_EQ(answer_last({group(7), group(51)}), STATE + " 0");
+    EXPECT_EQ(answer_last({group(7), {STATE + "/7/oper", {bn_type_str, "INIT"}}}), STATE + "/7" + whole);
+    EXPECT_EQ(answer_last({group(51)}), STATE + "/51" + whole);
+    EXPECT_EQ(found(), (strings{STATE + "/7=7", STATE + "/7/oper=INIT", STATE + "/51=51"}));
+    clear();
+    query(3, STATE, bn_query_iterate, bn_qf_subtree);
+    EXPECT_EQ(answer_last({}), STATE + " 0"); // no groups
+    EXPECT_EQ(code(), 0u);
+
+    const std::vector<event_field> large = {{STATE + "/1/debug", {bn_type_str, std::string(9 << 20, 'x')}}};
+    const auto start = [&](uint32_t asker) {
+        clear();
+        query(asker, STATE, bn_query_iterate, bn_qf_subtree);
+        EXPECT_EQ(answer_last({group(1), group(2), group(3)}), STATE + " 0");
+    };
+    start(3);
+    EXPECT_EQ(answer_last(large), STATE + "/1" + whole);
+    EXPECT_EQ(answer_last(large), STATE + "/2" + whole);
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_NO_BUFFER_SPACE));
+    EXPECT_EQ(message(), "The answer is larger than a message: ask for less");
+    for (uint32_t asker = 10; asker < 14; asker++) { // and all walks together are bounded
+        server_peer_opened(&daemon, asker, "mgmtctl-9");
+        start(asker);
+        EXPECT_EQ(answer_last(large), STATE + "/1" + whole);
+        EXPECT_EQ(code(), asker < 13 ? UINT32_MAX : static_cast<uint32_t>(LC_NO_SPACE));
+    }
+    now += MONITOR_TIMEOUT_MS;
+    clear();
+    EXPECT_EQ(server_tick(&daemon), -1);
+    EXPECT_EQ(sent.size(), 3u);
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_IO_TIMED_OUT));
+    EXPECT_EQ(daemon.gathered_bytes + daemon.pending_bytes, 0u);
+}
+
+// What a client doesn't read leaves room for less and less.
+TEST_F(Mgmtd, AnAnswerThatDoesNotFitIsRefused) {
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"}}), 0u);
+    clear();
+    daemon.fits = [](uint32_t peer_id, size_t bytes) { return peer_id == 3 && bytes < 200; };
+    query(3, GROUP, bn_query_iterate, bn_qf_subtree);
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_NO_BUFFER_SPACE));
+    EXPECT_EQ(message(), "Too much waits for you to read it: ask for less, or later");
+    EXPECT_EQ(last_response()->response_to, 77u);
+    query(3, GROUP + "/router/1/ipaddr", bn_query_get);
+    EXPECT_EQ(code(), 0u);
+    daemon.fits = nullptr;
+    query(3, STATE + "/51/debug", bn_query_get);
+    const bn_request_node *asked = last_node(sent.back().request);
+    const uint32_t half = GCL_FRAME_MAX / 2 - 64;
+    answer(1, sent.back().request->msg_id, asked->node_id, 0,
+           {{STATE + "/51/debug", {bn_type_str, std::string(half, 'x')}},
+            {STATE + "/51/debug", {bn_type_str, std::string(half, 'x')}}});
+    EXPECT_EQ(message(), "The answer is larger than a message: ask for less");
 }
 
 TEST_F(Mgmtd, AStateThatNobodyGives) {

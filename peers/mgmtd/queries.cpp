@@ -4,7 +4,12 @@
 // The state nodes of each daemon stand beside the schema; a query below one of their roots goes to the
 // daemon's session, all nodes of it in one request, with the rows in front as registration nodes. A query of
 // a subtree that holds such a root takes it along, and is none the worse when the daemon isn't there or
-// refuses. A node that can't be told in a message is left out, so that no asker waits in vain. The daemon
+// refuses.
+//
+// A walk of all service groups is asked for in steps: the list of groups first, then one group after the
+// other. The daemon therefore never builds an answer about more than one group, and a walk that comes to more
+// than a frame is refused here as soon as that is known.
+// A node that can't be told in a message is left out, so that no asker waits in vain. The daemon
 // whose session it is asks for its configuration only; it is never asked for what it asked for.
 #include <algorithm>
 
@@ -60,14 +65,10 @@ static bool append_registrations(bn_request_msg *msg, const state_source &source
 }
 
 namespace {
-struct forwarded {
-    uint32_t asked_id; // node id of the asker
-    uint32_t subop, flags;
-    std::string name;
-};
 struct query_plan {
     const state_source *source = nullptr;
-    std::vector<forwarded> nodes;
+    std::vector<asked_node> nodes; // of the request to the daemon
+    std::vector<asked_node> walks; // of all groups
     bool explicit_node = false;
 };
 } // namespace
@@ -83,16 +84,16 @@ static void plan_node(query_plan *plan, uint32_t node_id, uint32_t subop, uint32
         for (const char *text : source.roots) {
             node_name root;
             (void)parse_node_name(text, &root);
-            if (within(name, root)) {
-                plan->source = &source;
-                plan->explicit_node = true;
-                plan->nodes.push_back({node_id, subop, flags, name.text()});
+            const bool asked = within(name, root);
+            const bool subtree = subop == bn_query_iterate && (flags & bn_qf_subtree);
+            if (!asked && !(subtree && root.is_under(name)))
+                continue;
+            const asked_node node = {node_id, subop, flags, asked ? name.text() : text};
+            plan->source = &source;
+            plan->explicit_node |= asked;
+            (subtree && node.name == NODE_GROUP_STATE ? plan->walks : plan->nodes).push_back(node);
+            if (asked)
                 return;
-            }
-            if (subop == bn_query_iterate && (flags & bn_qf_subtree) && root.is_under(name)) {
-                plan->source = &source;
-                plan->nodes.push_back({node_id, subop, flags, text});
-            }
         }
 }
 
@@ -126,7 +127,7 @@ static void refuse_query(server *self, const pending_query &query, uint32_t code
 
 // What mgmtd answers itself. False when that is more than a message holds: the query has been refused.
 static bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
-    size_t bytes = 0;
+    size_t bytes = query.gathered_bytes;
     for (const asked_node &asked : query.asked) {
         node_name name;
         node_list found;
@@ -136,7 +137,7 @@ static bool append_own_answers(server *self, const pending_query &query, bn_resp
             const std::string text = entry->first.text();
             bytes += text.size() + entry->second.text.size() + ANSWER_NODE_BYTES;
             if (bytes > GCL_FRAME_MAX) {
-                refuse_query(self, query, LC_NO_SPACE, "The answer is larger than a message: ask for less");
+                refuse_query(self, query, LC_NO_BUFFER_SPACE, BN_TOO_LARGE);
                 return false;
             }
             (void)append_answer(response, asked.id, text, entry->second);
@@ -159,6 +160,7 @@ static std::vector<asked_node> nodes_asked_for(const bn_request_msg *msg) {
 pending_query server_take_pending(server *self, std::map<uint32_t, pending_query>::iterator at) {
     pending_query out = std::move(at->second);
     self->pending_bytes -= out.bytes;
+    self->gathered_bytes -= out.gathered_bytes;
     self->pending.erase(at);
     return out;
 }
@@ -170,35 +172,44 @@ static bool may_wait(const server *self, const pending_query &query) {
            self->pending_bytes + query.bytes <= PENDING_BYTES_MAX;
 }
 
-// The query to the daemon; `query` gets the numbers of its nodes. Null when it can't be made.
-static bn_request_msg *make_forwarded(const query_plan &plan, pending_query *query) {
+// The request to the daemon; `query` gets the numbers of its nodes. Null when it can't be made.
+static bn_request_msg *make_forwarded(const state_source &source, const std::vector<asked_node> &nodes,
+                                      bool list_groups, pending_query *query) {
     owned_request msg;
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK ||
-        !append_registrations(msg.pointer, *plan.source))
+        !append_registrations(msg.pointer, source))
         return nullptr;
-    for (const forwarded &node : plan.nodes) {
+    query->node_ids.clear();
+    query->list_id = 0;
+    for (const asked_node &node : nodes) {
         uint32_t node_id = 0;
         if (bn_query_request_msg_append_str(msg.pointer, node.subop, node.flags, node.name.c_str(),
                                             &node_id) != LC_OK)
             return nullptr;
-        query->node_ids[node_id] = node.asked_id;
+        query->node_ids[node_id] = node.id;
     }
+    if (list_groups && bn_query_request_msg_append_str(msg.pointer, bn_query_iterate, 0, NODE_GROUP_STATE,
+                                                       &query->list_id) != LC_OK)
+        return nullptr;
     return msg.take();
 }
 
-// 0 when the query waits for the daemon.
-static uint32_t forward(server *self, const query_plan &plan, pending_query query) {
+// 0 when the query waits for what the daemon answers about these nodes.
+static uint32_t forward(server *self, const std::vector<asked_node> &nodes, bool list_groups,
+                        pending_query query) {
     query.bytes = 0;
     for (const asked_node &node : query.asked)
         query.bytes += node.name.size() + PENDING_NODE_BYTES;
-    query.bytes += plan.nodes.size() * PENDING_NODE_BYTES;
+    query.bytes += (nodes.size() + query.walks.size()) * PENDING_NODE_BYTES;
     if (!may_wait(self, query))
         return LC_NO_SPACE;
-    const owned_request msg(make_forwarded(plan, &query));
+    const owned_request msg(make_forwarded(sources[query.source], nodes, list_groups, &query));
     if (!msg.pointer)
         return LC_IO_CLOSED;
     const uint32_t id = msg.pointer->msg_id = self->next_query_id++, provider = query.provider;
+    query.deadline_ms = self->now_ms() + MONITOR_TIMEOUT_MS;
     self->pending_bytes += query.bytes;
+    self->gathered_bytes += query.gathered_bytes;
     self->pending[id] = std::move(query);
     if (server_send_request(self, provider, msg.pointer))
         return LC_OK;
@@ -206,65 +217,109 @@ static uint32_t forward(server *self, const query_plan &plan, pending_query quer
     return LC_IO_CLOSED;
 }
 
+// The answer of mgmtd itself, and what the daemon has told. Limits are told to everybody; other failures of
+// the daemon to those who asked for its nodes by name.
+static void finish_query(server *self, const pending_query &query, uint32_t code, const std::string &words) {
+    if (code == LC_NO_SPACE || code == LC_NO_BUFFER_SPACE) {
+        refuse_query(self, query, code, words);
+        return;
+    }
+    owned_response response;
+    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, query.whole ? code : 0,
+                                     query.whole ? words.c_str() : "") != LC_OK ||
+        !append_own_answers(self, query, response.pointer))
+        return;
+    const bn_response_per_node_array *nodes = query.gathered ? query.gathered->nodes : nullptr;
+    for (uint32_t i = 0; i < bn_response_per_node_array_length_quick(nodes); i++) {
+        bn_response_node *node = bn_response_per_node_array_get_quick(nodes, i);
+        (void)bn_query_response_msg_append_binding_takeover(response.pointer, &node->binding, node->node_id);
+    }
+    (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
+}
+
+static void fail_to_ask(server *self, const pending_query &query, uint32_t code) {
+    const std::string daemon = sources[query.source].client;
+    finish_query(self, query, code,
+                 code == LC_NO_SPACE ? "Too many queries wait for " + daemon : daemon + " has no session");
+}
+
 void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
     query_plan plan;
-    pending_query query = {.asker = peer_id,
-                           .provider = 0,
-                           .asker_message_id = msg->msg_id,
-                           .asker_transaction_id = msg->transaction_id,
-                           .deadline_ms = self->now_ms() + MONITOR_TIMEOUT_MS,
-                           .whole = false,
-                           .asked = nodes_asked_for(msg),
-                           .node_ids = {},
-                           .bytes = 0};
+    pending_query query = {};
+    query.asker = peer_id;
+    query.asker_message_id = msg->msg_id;
+    query.asker_transaction_id = msg->transaction_id;
+    query.asked = nodes_asked_for(msg);
     for (const asked_node &node : query.asked)
         if (node_name name; parse_node_name(node.name, &name))
             plan_node(&plan, node.id, node.subop, node.flags, name);
-    query.whole = plan.explicit_node;
-    uint32_t code = LC_OK;
-    if (!plan.nodes.empty()) {
-        query.provider = find_provider(self, *plan.source, peer_id);
-        code = query.provider ? forward(self, plan, query) : uint32_t{LC_IO_CLOSED};
-        if (code == LC_OK)
-            return;
-        if (code == LC_NO_SPACE) {
-            refuse_query(self, query, code, "Too many queries wait for " + std::string(plan.source->client));
-            return;
-        }
-    }
-    server_answer_without(self, query, code,
-                          plan.source ? plan.source->client + std::string(" has no session") : "");
-}
-
-void server_answer_without(server *self, const pending_query &query, uint32_t code, const std::string &why) {
-    owned_response response;
-    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, query.whole ? code : 0,
-                                     query.whole ? why.c_str() : "") == LC_OK &&
-        append_own_answers(self, query, response.pointer))
-        (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
-}
-
-void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg) {
-    const auto found = self->pending.find(msg->response_to);
-    if (found == self->pending.end() || found->second.provider != peer_id)
-        return; // too late, or never asked for
-    const pending_query query = server_take_pending(self, found);
-    owned_response response;
-    const bool told = query.whole && msg->return_message;
-    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id,
-                                     query.whole ? msg->return_code : 0,
-                                     told ? ts_str(msg->return_message) : "") != LC_OK ||
-        !append_own_answers(self, query, response.pointer))
+    if (!plan.source) {
+        finish_query(self, query, LC_OK, "");
         return;
-    const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
-    for (uint32_t i = 0; i < count; i++) {
+    }
+    query.whole = plan.explicit_node;
+    query.source = static_cast<size_t>(plan.source - sources);
+    query.walks = std::move(plan.walks);
+    query.provider = find_provider(self, *plan.source, peer_id);
+    const uint32_t code =
+        query.provider ? forward(self, plan.nodes, !query.walks.empty(), query) : uint32_t{LC_IO_CLOSED};
+    if (code != LC_OK)
+        fail_to_ask(self, query, code);
+}
+
+void server_answer_without(server *self, pending_query query, uint32_t code, const std::string &why) {
+    query.gathered.reset();
+    query.gathered_bytes = 0;
+    finish_query(self, query, code, why);
+}
+
+// Takes over what the daemon answers. False when that doesn't go on: the query has been refused.
+static bool gather(server *self, pending_query *query, bn_response_msg *msg, size_t bytes) {
+    query->gathered_bytes += bytes;
+    if (query->gathered_bytes > GCL_FRAME_MAX) {
+        refuse_query(self, *query, LC_NO_BUFFER_SPACE, BN_TOO_LARGE);
+        return false;
+    }
+    bn_response_msg *made = nullptr;
+    if (self->gathered_bytes + query->gathered_bytes > GATHERED_BYTES_MAX ||
+        (!query->gathered && bn_query_response_msg_create(&made, 0, 0, nullptr) != LC_OK)) {
+        refuse_query(self, *query, LC_NO_SPACE, "Too many large answers wait: ask for less, or later");
+        return false;
+    }
+    if (made)
+        query->gathered.reset(made, bn_release_response);
+    for (uint32_t i = 0; i < bn_response_per_node_array_length_quick(msg->nodes); i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
         if (!node || !node->binding)
             continue;
-        const auto asked = query.node_ids.find(node->node_id);
-        if (asked != query.node_ids.end())
-            (void)bn_query_response_msg_append_binding_takeover(response.pointer, &node->binding,
+        const auto asked = query->node_ids.find(node->node_id);
+        if (asked != query->node_ids.end())
+            (void)bn_query_response_msg_append_binding_takeover(query->gathered.get(), &node->binding,
                                                                 asked->second);
+        else if (query->list_id && node->node_id == query->list_id)
+            query->groups.push_back(name_of(node->binding));
     }
-    (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
+    return true;
+}
+
+void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg, size_t bytes) {
+    const auto found = self->pending.find(msg->response_to);
+    if (found == self->pending.end() || found->second.provider != peer_id)
+        return; // too late, or never asked for
+    pending_query query = server_take_pending(self, found);
+    if (!gather(self, &query, msg, bytes))
+        return;
+    if (msg->return_code != LC_OK || query.next_group == query.groups.size()) {
+        finish_query(self, query, msg->return_code, msg->return_message ? ts_str(msg->return_message) : "");
+        return;
+    }
+    std::vector<asked_node> nodes = query.walks;
+    for (asked_node &node : nodes) {
+        node.name = query.groups[query.next_group];
+        node.flags |= bn_qf_include_self;
+    }
+    query.next_group++;
+    const uint32_t code = forward(self, nodes, false, query);
+    if (code != LC_OK)
+        fail_to_ask(self, query, code);
 }

@@ -39,6 +39,21 @@ bool server_send_request(server *self, uint32_t peer_id, bn_request_msg *msg) {
     return true;
 }
 
+// A response without bindings instead of one that doesn't fit, whose bytes are freed.
+static tbuffer *refusal_of(const bn_response_msg *msg, const char *words, tbuffer *unsent) {
+    tb_free(&unsent);
+    owned_response refusal;
+    if (bn_response_msg_create(&refusal.pointer, msg->msg_type, msg->response_to, LC_NO_BUFFER_SPACE,
+                               words) != LC_OK)
+        return nullptr;
+    refusal.pointer->service_id = msg->service_id;
+    refusal.pointer->msg_id = msg->msg_id;
+    refusal.pointer->transaction_id = msg->transaction_id;
+    tbuffer *frame = nullptr;
+    (void)bn_response_msg_serialize(refusal.pointer, BN_FRAME_HEADER_BYTES, &frame);
+    return frame;
+}
+
 bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, uint32_t transaction_id) {
     const auto found = self->peers.find(peer_id);
     if (!msg || found == self->peers.end())
@@ -47,10 +62,17 @@ bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, 
     msg->msg_id = found->second.next_message_id++;
     msg->transaction_id = transaction_id;
     msg->db_revision_id = self->tree.revision;
-    tbuffer *frame = nullptr;
-    if (bn_response_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &frame) != LC_OK)
+    owned_tbuffer frame;
+    if (bn_response_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &frame.pointer) != LC_OK ||
+        frame.pointer->length > GCL_FRAME_MAX) {
+        frame.pointer = refusal_of(msg, BN_TOO_LARGE, frame.take());
+    } else if (self->fits && !self->fits(peer_id, frame.pointer->length)) {
+        frame.pointer =
+            refusal_of(msg, "Too much waits for you to read it: ask for less, or later", frame.take());
+    }
+    if (!frame.pointer)
         return false;
-    self->send(peer_id, msg->msg_type, frame);
+    self->send(peer_id, msg->msg_type, frame.take());
     return true;
 }
 
@@ -294,6 +316,6 @@ bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbu
     if (bn_response_msg_deserialize(frame, BN_FRAME_HEADER_BYTES, &msg.pointer) != LC_OK)
         return false;
     if (mtype == bn_msg_query_response)
-        server_take_monitor_answer(self, peer_id, msg.pointer);
+        server_take_monitor_answer(self, peer_id, msg.pointer, frame->length);
     return true;
 }

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <functional>
 #include <map>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -17,6 +18,8 @@ constexpr size_t ALARMS_MAX = 4096; // that are kept
 // What clients can make mgmtd keep for them: queries that wait for a daemon, of one session and of all, and
 // the names in these; the interests of one session, and the text in these.
 constexpr size_t PENDING_SESSION_MAX = 32, PENDING_MAX = 512, PENDING_BYTES_MAX = 8u << 20;
+// What daemons have answered to walks that go on, of all sessions.
+constexpr size_t GATHERED_BYTES_MAX = 32u << 20;
 constexpr size_t INTERESTS_MAX = 64, INTEREST_BYTES_MAX = 64u << 10;
 
 struct interest {
@@ -44,9 +47,18 @@ struct pending_query {
     std::vector<asked_node> asked;         // as they came
     std::map<uint32_t, uint32_t> node_ids; // of the forwarded query to the asker's
     size_t bytes;                          // that count against PENDING_BYTES_MAX
+    size_t source;                         // the daemon, by its place in the table of daemons
+    std::vector<asked_node> walks;         // of all groups, which are asked for one after the other
+    uint32_t list_id;                      // of the forwarded query that lists the groups, or 0
+    std::vector<std::string> groups;       // their names
+    size_t next_group;
+    std::shared_ptr<bn_response_msg> gathered; // what the daemon has answered so far
+    size_t gathered_bytes;                     // of it in messages
 };
 
 struct server {
+    // Whether the peer's queue takes so many bytes more; null: always.
+    std::function<bool(uint32_t peer_id, size_t bytes)> fits;
     // The frame has 32 bytes of room for its header; it is the callee's.
     std::function<void(uint32_t peer_id, uint16_t mtype, tbuffer *frame)> send;
     std::function<int64_t()> now_ms; // monotonic
@@ -59,10 +71,10 @@ struct server {
     config_comments comments;
     node_map state; // nodes that mgmtd itself reports
     std::map<uint32_t, peer> peers;
-    std::map<uint32_t, pending_query> pending; // by the message id of the forwarded query
-    size_t pending_bytes = 0;
-    std::map<node_name, uint32_t> alarm_owners; // root nodes of what a session reported
-    uint32_t next_query_id = 0x40000000;        // apart from the ids of other messages
+    std::map<uint32_t, pending_query> pending;    // by the message id of the forwarded query
+    size_t pending_bytes = 0, gathered_bytes = 0; // of all pending queries
+    std::map<node_name, uint32_t> alarm_owners;   // root nodes of what a session reported
+    uint32_t next_query_id = 0x40000000;          // apart from the ids of other messages
     uint64_t peers_seen = 0;
 };
 
@@ -94,8 +106,8 @@ void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg);
 // Takes a query out of those that wait.
 pending_query server_take_pending(server *self, std::map<uint32_t, pending_query>::iterator at);
 // The answer to a query that no daemon answers any more.
-void server_answer_without(server *self, const pending_query &query, uint32_t code, const std::string &why);
-void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg);
+void server_answer_without(server *self, pending_query query, uint32_t code, const std::string &why);
+void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg, size_t bytes);
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,
                        const std::vector<event_field> &fields);
 void server_forget_reports(server *self, uint32_t peer_id);

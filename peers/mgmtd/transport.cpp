@@ -24,13 +24,20 @@
 #include "mgmt/gcl_wire.h"
 
 static constexpr const char *PROVIDER_NAME = "mgmtd";
-static constexpr int READS_A_TURN = 16; // then the others have theirs
+static constexpr int READS_A_TURN = 16;                          // then the others have theirs
 static constexpr const char *DAEMONS[] = {"wccpd-", "tunneld-"}; // what their names begin with
 
 static void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken);
+static bool fits_queue(const session &client, size_t bytes) {
+    return client.queued_bytes == 0 || client.queued_bytes + bytes <= QUEUE_MAX_BYTES;
+}
 
 bool transport_listen(transport *self, server *owner, std::string *out_error) {
     self->owner = owner;
+    owner->fits = [self](uint32_t id, size_t bytes) {
+        const auto found = self->sessions.find(id);
+        return found == self->sessions.end() || fits_queue(found->second, bytes);
+    };
     owner->send = [self](uint32_t id, uint16_t mtype, tbuffer *frame) { send_bnode(self, id, mtype, frame); };
     self->place.say = owner->say;
     return listener_open(&self->place, out_error);
@@ -66,7 +73,7 @@ static void queue_frame(transport *self, session *client, uint16_t proto, uint16
     header.mtype = to_be16(mtype);
     header.body_length = to_be32(length - static_cast<uint32_t>(sizeof header));
     memcpy(frame.data(), &header, sizeof header);
-    if (client->queued_bytes > 0 && client->queued_bytes + frame.size() > QUEUE_MAX_BYTES) {
+    if (!fits_queue(*client, frame.size())) {
         end_session(self, client, "does not read, ended");
         return;
     }

@@ -13,10 +13,11 @@
 #include "peers/mgmtd/server.h"
 
 constexpr size_t SESSIONS_MAX = 64;
-constexpr size_t CLIENT_SESSIONS_MAX = 56;    // the other places are kept for the appliance's daemons
-constexpr size_t QUEUE_MAX_BYTES = 32u << 20; // for a client that doesn't read; then its session ends
-constexpr uint32_t OPENING_FRAME_MAX = 4096;  // before the service is open
-constexpr int64_t OPENING_MAX_MS = 10000;     // from the connection until the service is open
+constexpr size_t CLIENT_SESSIONS_MAX = 56; // the other places are kept for the appliance's daemons
+// For a client that doesn't read. An answer that doesn't fit is refused; for other frames its session ends.
+constexpr size_t QUEUE_MAX_BYTES = 32u << 20;
+constexpr uint32_t OPENING_FRAME_MAX = 4096; // before the service is open
+constexpr int64_t OPENING_MAX_MS = 10000;    // from the connection until the service is open
 constexpr int64_t LISTENER_CHECK_MS = 2000;
 
 struct session {
