@@ -91,6 +91,15 @@ lc_status array_new(array **out, const array_options *options) {
     return LC_OK;
 }
 
+void array_place(array *record, const array_options *options, void **elements, uint32_t count) {
+    *record = array{};
+    (void)array_options_set(record, options);
+    record->elements = elements;
+    record->initial_size = record->capacity = record->length = count;
+    record->sorted = count == 1;
+    record->placed_record = record->placed_elements = 1;
+}
+
 static void give(array *list, void *element) {
     if (element)
         list->free(element);
@@ -105,8 +114,10 @@ lc_status array_free(array **inout) {
     array_index_drop(list);
     while (list->length)
         give(list, list->elements[--list->length]);
-    free(list->elements);
-    free(list);
+    if (!list->placed_elements)
+        free(list->elements);
+    if (!list->placed_record)
+        free(list);
     return LC_OK;
 }
 lc_status array_empty(array *list) {
@@ -132,8 +143,12 @@ static lc_status make_room(array *list, uint64_t length) {
         capacity = std::min<uint64_t>(std::max(capacity + 10, capacity * 2), array_size_max);
     if (capacity == list->capacity)
         return LC_OK;
-    auto *elements = static_cast<void **>(realloc(list->elements, capacity * sizeof(void *)));
+    auto *elements = static_cast<void **>(
+        realloc(list->placed_elements ? nullptr : list->elements, capacity * sizeof(void *)));
     CHECK_NULL(elements);
+    if (list->placed_elements)
+        memcpy(elements, list->elements, list->length * sizeof(void *));
+    list->placed_elements = 0;
     list->elements = elements;
     list->capacity = static_cast<uint32_t>(capacity);
     return LC_OK;

@@ -54,6 +54,8 @@ struct array {
     array_hash_function hash;
     const std::atomic<uint32_t> *key_changes;
     mutable array_index *index; // null until a search needs it (array_index.h)
+    uint8_t placed_record;      // lies in memory that isn't the array's own, see array_place
+    uint8_t placed_elements;
 };
 
 lc_status array_options_get_defaults(array_options *out);
@@ -64,6 +66,10 @@ lc_status array_std_assign_func(const void *element, void **out_copy);
 lc_status array_std_takeover_func(void **inout_element, void **out_slot);
 
 lc_status array_new(array **out, const array_options *options);
+// Makes an array of `count` slots, at least one, in memory that belongs to something else and has to outlive
+// the array. All operations work: an array that has to grow gets slots of its own, and freeing it frees those
+// only. The slots are filled by the caller.
+void array_place(array *record, const array_options *options, void **elements, uint32_t count);
 lc_status array_free(array **inout);
 lc_status array_empty(array *list);
 lc_status array_length(const array *list, uint32_t *out_length);

@@ -124,7 +124,8 @@ lc_status tb_free(tbuffer **inout) {
     if (*inout) {
         if (!(*inout)->constant)
             free((*inout)->buffer);
-        free(*inout);
+        if (!(*inout)->placed)
+            free(*inout);
     }
     *inout = nullptr;
     return LC_OK;

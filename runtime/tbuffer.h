@@ -22,6 +22,7 @@ struct tbuffer {
     uint32_t size;
     uint8_t auto_shrink; // set by the owner: the buffer gives memory back when it becomes shorter
     uint8_t constant;    // the bytes are borrowed; writers refuse
+    uint8_t placed;      // the record lies in memory that isn't the buffer's own, see tb_place
 };
 
 lc_status tb_new(tbuffer **out);
@@ -29,6 +30,11 @@ lc_status tb_new_size(tbuffer **out, uint32_t size);
 lc_status tb_new_buf(tbuffer **out, const void *bytes, int32_t length); // -1: strlen
 lc_status tb_new_takeover(tbuffer **out, uint8_t **inout_bytes, uint32_t length, uint32_t size);
 lc_status tb_new_buf_const(tbuffer **out, const void *bytes, uint32_t length);
+// Makes a constant buffer of a record and bytes that belong to something else, and have to outlive it.
+// A NUL follows the bytes. Freeing it frees nothing.
+inline void tb_place(tbuffer *record, uint8_t *bytes, uint32_t length) {
+    *record = {bytes, length, length, 0, 1, 1};
+}
 lc_status tb_free(tbuffer **inout);
 lc_status tb_detach(tbuffer **inout, uint8_t **out_bytes, uint32_t *out_length);
 lc_status tb_dup(const tbuffer *buffer, tbuffer **out);

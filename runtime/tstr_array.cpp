@@ -32,6 +32,39 @@ lc_status tstr_array_new(tstr_array **out, const tstr_array_options *options) {
     return tstr_array_new_full(out, &all);
 }
 
+namespace {
+// What lies in front of the slots, the records and the texts of a packed array. Freeing the family's record
+// frees the whole.
+struct packed {
+    tstr_array family;
+    array list;
+};
+} // namespace
+
+lc_status tstr_array_new_packed(tstr_array **out, uint32_t count, size_t text_bytes, tstring **out_records,
+                                char **out_text) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_CONDITION(count > 0 && count <= array_size_max);
+    array_options options;
+    CHECK_STATUS(array_options_get_defaults(&options));
+    string_options(&options);
+    const size_t slots = sizeof(packed), records = slots + count * sizeof(void *);
+    const size_t texts = records + count * sizeof(tstring);
+    auto *memory = static_cast<uint8_t *>(malloc(texts + text_bytes));
+    CHECK_NULL(memory);
+    auto *head = reinterpret_cast<packed *>(memory);
+    auto **elements = reinterpret_cast<void **>(memory + slots);
+    *out_records = reinterpret_cast<tstring *>(memory + records);
+    *out_text = reinterpret_cast<char *>(memory + texts);
+    for (uint32_t i = 0; i < count; i++)
+        elements[i] = *out_records + i;
+    array_place(&head->list, &options, elements, count);
+    head->family.list = &head->list;
+    *out = &head->family;
+    return LC_OK;
+}
+
 lc_status tstr_array_get_str(const tstr_array *array, uint32_t index, const char **out_text) {
     CHECK_NULL(out_text);
     *out_text = nullptr;

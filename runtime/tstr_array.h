@@ -12,6 +12,10 @@ struct tstr_array_options {
 
 TYPED_ARRAY_DECLARE(tstr_array, tstring *)
 lc_status tstr_array_new(tstr_array **out, const tstr_array_options *options); // null: duplicates are allowed
+// An array of `count` strings, at least one, in a single allocation with room for `text_bytes` bytes of text.
+// The caller makes each of the `out_records` with ts_place, with a text that begins at or behind `out_text`.
+lc_status tstr_array_new_packed(tstr_array **out, uint32_t count, size_t text_bytes, tstring **out_records,
+                                char **out_text);
 
 // Texts live as long as the array holds them.
 lc_status tstr_array_get_str(const tstr_array *array, uint32_t index, const char **out_text);

@@ -16,14 +16,19 @@
 
 // ---- Size
 
-static lc_status give_size(tstring *string, uint32_t size) {
-    if (size == string->size)
-        return LC_OK;
-    auto *buffer = static_cast<char *>(realloc(string->buffer, size));
+static lc_status give_own_bytes(tstring *string, uint32_t size) {
+    const bool placed = string->placed & ts_placed_bytes;
+    auto *buffer = static_cast<char *>(placed ? malloc(size) : realloc(string->buffer, size));
     CHECK_NULL(buffer);
+    if (placed)
+        memcpy(buffer, string->buffer, static_cast<size_t>(string->length) + 1);
+    string->placed &= ts_placed_record;
     string->buffer = buffer;
     string->size = size;
     return LC_OK;
+}
+static lc_status give_size(tstring *string, uint32_t size) {
+    return size == string->size ? LC_OK : give_own_bytes(string, size);
 }
 
 static uint32_t shrunk(uint32_t size, uint64_t need) {
@@ -191,8 +196,10 @@ lc_status ts_set_utf8(tstring *string, int on) {
 lc_status ts_free(tstring **inout) {
     CHECK_NULL(inout);
     if (*inout) {
-        free((*inout)->buffer);
-        free(*inout);
+        if (!((*inout)->placed & ts_placed_bytes))
+            free((*inout)->buffer);
+        if (!((*inout)->placed & ts_placed_record))
+            free(*inout);
     }
     *inout = nullptr;
     return LC_OK;
@@ -211,10 +218,14 @@ lc_status ts_detach(tstring **inout, char **out_text, int32_t *out_length) {
     CHECK_NULL(inout);
     CHECK_NULL(*inout);
     CHECK_NULL(out_text);
-    *out_text = (*inout)->buffer;
+    tstring *string = *inout;
+    if (string->placed & ts_placed_bytes)
+        CHECK_QUIET(give_own_bytes(string, std::max(string->size, ts_size_initial)));
+    *out_text = string->buffer;
     if (out_length)
-        *out_length = (*inout)->length;
-    free(*inout);
+        *out_length = string->length;
+    if (!(string->placed & ts_placed_record))
+        free(string);
     *inout = nullptr;
     return LC_OK;
 }

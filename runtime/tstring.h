@@ -14,9 +14,11 @@ constexpr uint32_t ts_resize_factor = 2;
 constexpr uint32_t ts_size_max = 0x5000000;
 constexpr uint32_t ts_size_max_extra_growth = 0x800000;
 
+enum : uint8_t { ts_placed_record = 1, ts_placed_bytes = 2 };
 struct tstring {
     char *buffer;
     uint8_t utf8;
+    uint8_t placed;     // ts_placed_...: what lies in memory that isn't the string's own, see ts_place
     int32_t length;     // bytes, without the NUL
     int32_t characters; // equals length when not UTF-8
     uint32_t size;      // allocated bytes
@@ -29,6 +31,13 @@ lc_status ts_new_sprintf(tstring **out, const char *format, ...) __attribute__((
 // Takes a heap text over; -1 for `length` or `size` asks for strlen.
 lc_status ts_new_str_takeover(tstring **out, char **inout_text, int32_t length, int32_t size);
 lc_status ts_new_str_takeover_utf8(tstring **out, char **inout_text, int32_t length, int32_t size);
+// Makes a string in memory that belongs to something else, and has to outlive the string. All operations
+// work: a string that has to grow gets bytes of its own, and freeing it frees those only. `bytes` ends in a
+// NUL.
+inline void ts_place(tstring *record, char *bytes, int32_t length) {
+    *record = {bytes,  0,      ts_placed_record | ts_placed_bytes,
+               length, length, static_cast<uint32_t>(length) + 1};
+}
 lc_status ts_set_utf8(tstring *string, int on);
 lc_status ts_free(tstring **inout);
 lc_status ts_clear(tstring *string);

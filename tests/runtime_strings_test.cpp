@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <cstring>
 #include <string>
 #include <vector>
 
@@ -109,6 +110,36 @@ TEST(Strings, NullsTakeoverAndOrder) {
     EXPECT_TRUE(ts_equal(nullptr, nullptr) && !ts_equal(string, nullptr) && !ts_equal(string, other));
     EXPECT_LT(ts_cmp(string, other), 0);
     EXPECT_TRUE(ts_equal_str(string, "nAME", 1) && !ts_equal_str(string, "nAME", 0));
+}
+
+// In memory that isn't theirs, strings and arrays of them take any operation and leave that memory alone.
+TEST(Strings, PackedInOneAllocation) {
+    static const struct {
+        lc_status (*change)(tstring *);
+        const char *left;
+    } changes[] = {
+        {[](tstring *string) { return ts_append_str(string, "cdefghijklmnopq"); }, "abcdefghijklmnopq"},
+        {[](tstring *string) { return ts_copy_str(string, 1, "c"); }, "ac"},
+        {[](tstring *string) { return ts_trim(string, 'a', 0); }, "b"},
+        {[](tstring *string) { return ts_set_utf8(string, 1); }, "ab"},
+        {ts_clear, ""},
+    };
+    for (const auto &c : changes) {
+        tokens_owner array;
+        tstring *records = nullptr, *one = nullptr;
+        char *bytes = nullptr, *taken = nullptr;
+        ASSERT_EQ(tstr_array_new_packed(&array, 2, 6, &records, &bytes), LC_OK);
+        memcpy(bytes, "ab\0cd", 6);
+        ts_place(&records[0], bytes, 2);
+        ts_place(&records[1], bytes + 3, 2);
+        EXPECT_EQ(left(c.change(records), records), c.left);
+        ASSERT_EQ(tstr_array_append_str(array, "more"), LC_OK); // moves the slots
+        EXPECT_STREQ(tstr_array_get_str_quick(array, 1), "cd");
+        ASSERT_EQ(tstr_array_remove(array, 0, &one), LC_OK);
+        ASSERT_EQ(ts_detach(&one, &taken, nullptr), LC_OK);
+        EXPECT_STREQ(taken, c.left);
+        free(taken);
+    }
 }
 
 TEST(Strings, CharactersOfUtf8) {
