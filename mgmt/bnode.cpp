@@ -1,35 +1,18 @@
 // Bindings: a name and the attributes of the node.
 //
-// The parts of a name are made when somebody asks for them and kept until the name changes. A binding's
-// attributes lie in an array whose index is the attribute id; an id is checked before it becomes a place, so
-// the array never has more than some hundred slots.
+// The parts of a name are made when somebody asks for them and kept until the name changes.
 #include "mgmt/bnode.h"
 
 #include <cstdlib>
 #include <cstring>
 
+#include "mgmt/bnode_block.h"
 #include "mgmt/bnode_rows.h"
 #include "runtime/guards.h"
 #include "runtime/logging.h"
 
 // Counts renamings, so that arrays which have found a binding by its name notice.
 std::atomic<uint32_t> bn_binding_renames;
-
-static lc_status attrib_dup_for_array(const void *element, void **out_copy) {
-    bn_attrib *copy = nullptr;
-    CHECK_STATUS(bn_attrib_dup(static_cast<const bn_attrib *>(element), &copy));
-    *out_copy = copy;
-    return LC_OK;
-}
-static void attrib_free_for_array(void *element) {
-    bn_release_attrib(static_cast<bn_attrib *>(element));
-}
-static void attrib_options(array_options *options) {
-    options->compare = nullptr;
-    options->duplicate = attrib_dup_for_array;
-    options->free = attrib_free_for_array;
-}
-TYPED_ARRAY_DEFINE(bn_attrib_array, bn_attrib *, attrib_options)
 
 // ---- Life
 
@@ -39,7 +22,10 @@ lc_status bn_binding_free(bn_binding **inout) {
         (void)ts_free(&binding->name);
         (void)tstr_array_free(&binding->parts);
         (void)bn_attrib_array_free(&binding->attributes);
-        free(binding);
+        if (binding->block_distance)
+            bn_block_release(bn_block_of(binding));
+        else
+            free(binding);
     }
     *inout = nullptr;
     return LC_OK;
@@ -53,21 +39,31 @@ lc_status bn_binding_new_parts_components_takeover(bn_binding **out, tstring **i
     CHECK_NULL(binding.pointer);
     tstring *name = inout_name ? *inout_name : nullptr;
     tstr_array *parts = inout_parts ? *inout_parts : nullptr;
+    bn_attrib_array *attributes = inout_attributes ? *inout_attributes : nullptr;
     owned<tstring, ts_release> made_name;
     owned<tstr_array, tstr_array_release> made_parts;
+    owned<bn_attrib_array, bn_attrib_array_release> made_attributes;
     if (!name)
         CHECK_NULL(parts);
+    // What another binding's block holds can't leave it.
+    if (name && name->placed)
+        CHECK_STATUS(ts_dup(name, &made_name.pointer));
+    if (attributes && attributes->placed_record)
+        CHECK_STATUS(bn_attrib_array_duplicate(attributes, &made_attributes.pointer));
     if (!name)
         CHECK_STATUS(bn_binding_name_parts_to_name_tstr(parts, absolute, &made_name.pointer));
     else if (!parts)
         CHECK_STATUS(bn_binding_name_to_parts(ts_str(name), &made_parts.pointer, &absolute));
-    binding.pointer->name = name ? name : made_name.take();
+    if (made_name.pointer)
+        ts_release(name);
+    if (made_attributes.pointer)
+        bn_attrib_array_release(attributes);
+    binding.pointer->name = made_name.pointer ? made_name.take() : name;
     binding.pointer->parts = parts ? parts : made_parts.take();
     binding.pointer->absolute = absolute ? 1 : 0;
-    if (inout_attributes) {
-        binding.pointer->attributes = *inout_attributes;
+    binding.pointer->attributes = made_attributes.pointer ? made_attributes.take() : attributes;
+    if (inout_attributes)
         *inout_attributes = nullptr;
-    }
     if (inout_name)
         *inout_name = nullptr;
     if (inout_parts)
@@ -112,11 +108,15 @@ lc_status bn_binding_dup(const bn_binding *binding, bn_binding **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(binding);
+    bn_block_size size{};
+    bn_block_builder builder;
     owned<bn_binding, bn_release_binding> copy;
-    CHECK_STATUS(bn_binding_new_components(&copy.pointer, ts_str(binding->name), binding->attributes));
+    bn_size_copy(&size, binding);
+    CHECK_QUIET(bn_block_new(&size, &builder));
+    const owned_block held(builder.block);
+    CHECK_STATUS(bn_place_copy(&builder, binding, &copy.pointer));
     if (binding->parts)
         CHECK_STATUS(tstr_array_duplicate(binding->parts, &copy.pointer->parts));
-    copy.pointer->absolute = binding->absolute;
     *out = copy.take();
     return LC_OK;
 }
@@ -144,13 +144,8 @@ lc_status bn_binding_set_attrib_takeover(bn_binding *binding, bn_attrib **inout_
     CHECK_NULL(*inout_attrib);
     const uint32_t id = (*inout_attrib)->attribute_id;
     CHECK_CONDITION(bn_attrib_id_valid(id));
-    if (!binding->attributes) {
-        array_options options;
-        CHECK_STATUS(array_options_get_defaults(&options));
-        attrib_options(&options);
-        options.initial_size = id + 1; // most nodes have their value and nothing else
-        CHECK_STATUS(bn_attrib_array_new_full(&binding->attributes, &options));
-    }
+    if (!binding->attributes)
+        CHECK_STATUS(bn_attrib_array_new(&binding->attributes));
     CHECK_STATUS(bn_attrib_array_set_takeover(binding->attributes, id, inout_attrib));
     return LC_OK;
 }

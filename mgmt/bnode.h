@@ -13,8 +13,32 @@
 #include "runtime/tstring.h"
 #include "runtime/typed_arrays.h"
 
-// The index is the attribute id; slots may be empty.
-TYPED_ARRAY_DECLARE(bn_attrib_array, bn_attrib *)
+// An array whose index is the attribute id; slots may be empty, and then take no memory. The operations are
+// those of typed_arrays.h.
+struct bn_attrib_slot {
+    uint32_t id;
+    uint32_t placed; // the attribute's record isn't its own memory (bnode_block.h)
+    bn_attrib *attrib;
+};
+struct bn_attrib_array {
+    bn_attrib_slot *slots; // those that are filled, in order of id
+    uint32_t length;       // the highest id so far, and 1
+    uint32_t count;        // of slots
+    uint32_t capacity;
+    uint8_t placed_record; // not its own memory either
+    uint8_t placed_slots;
+};
+lc_status bn_attrib_array_new(bn_attrib_array **out);
+lc_status bn_attrib_array_new_full(bn_attrib_array **out, const array_options *options); // not looked at
+lc_status bn_attrib_array_free(bn_attrib_array **inout);
+void bn_attrib_array_release(bn_attrib_array *array);
+lc_status bn_attrib_array_duplicate(const bn_attrib_array *array, bn_attrib_array **out);
+uint32_t bn_attrib_array_length_quick(const bn_attrib_array *array);
+lc_status bn_attrib_array_get(const bn_attrib_array *array, uint32_t id, bn_attrib **out);
+bn_attrib *bn_attrib_array_get_quick(const bn_attrib_array *array, uint32_t id);
+lc_status bn_attrib_array_set(bn_attrib_array *array, uint32_t id, const bn_attrib *attrib);
+lc_status bn_attrib_array_set_takeover(bn_attrib_array *array, uint32_t id, bn_attrib **inout);
+
 // Compares by name and does not sort by itself.
 TYPED_ARRAY_DECLARE(bn_binding_array, bn_binding *)
 
@@ -22,6 +46,7 @@ struct bn_binding {
     tstring *name;
     tstr_array *parts;           // unescaped; null until asked for
     uint32_t absolute;           // the name begins with "/"
+    uint32_t block_distance;     // from the block that the binding lies in (bnode_block.h); 0 for none
     bn_attrib_array *attributes; // or null
 };
 

@@ -8,6 +8,7 @@
 #include <cstring>
 
 #include "mgmt/bnode.h"
+#include "mgmt/bnode_block.h"
 #include "mgmt/bnode_names.h"
 #include "runtime/guards.h"
 #include "runtime/hash_table.h"
@@ -38,6 +39,14 @@ static void binding_options(array_options *options) {
     options->key_changes = &bn_binding_renames;
 }
 TYPED_ARRAY_DEFINE(bn_binding_array, bn_binding *, binding_options)
+
+lc_status bn_binding_array_new_sized(bn_binding_array **out, uint32_t count) {
+    array_options options = {};
+    CHECK_STATUS(array_options_get_defaults(&options));
+    binding_options(&options);
+    options.initial_size = count ? count : 1;
+    return bn_binding_array_new_full(out, &options);
+}
 
 // ---- By name
 

@@ -51,16 +51,28 @@ lc_status bn_attrib_dup(const bn_attrib *attrib, bn_attrib **out) {
     CHECK_STATUS(bn_attrib_new(&copy.pointer));
     *copy.pointer = *attrib;
     if (owns_text(attrib)) {
-        copy.pointer->value.string = nullptr;
+        memset(&copy.pointer->value, 0, sizeof copy.pointer->value);
         if (attrib->value.string)
             CHECK_STATUS(ts_dup(attrib->value.string, &copy.pointer->value.string));
     } else if (owns_binary(attrib)) {
-        copy.pointer->value.binary = nullptr;
+        memset(&copy.pointer->value, 0, sizeof copy.pointer->value);
         if (attrib->value.binary)
             CHECK_STATUS(tb_dup(attrib->value.binary, &copy.pointer->value.binary));
     }
     *out = copy.take();
     return LC_OK;
+}
+void bn_attrib_place_value(bn_attrib *attrib, char *text, uint32_t length) {
+    if (owns_text(attrib)) {
+        auto *placed = &attrib->value.placed_string;
+        ts_place(&placed->record, text, static_cast<int32_t>(length));
+        placed->string = &placed->record;
+    } else {
+        auto *placed = &attrib->value.placed_binary;
+        tb_place(&placed->record, reinterpret_cast<uint8_t *>(text), length);
+        placed->binary = &placed->record;
+    }
+    attrib->value_size = length;
 }
 lc_status bn_attrib_get_type(const bn_attrib *attrib, uint32_t *out_type, uint32_t *out_flags) {
     CHECK_NULL(attrib);

@@ -1,10 +1,11 @@
 // The bytes of an attribute on the wire: 16 bytes of kind, id, type and flags, then what the type's family
-// says. All numbers are big-endian; an address counts as one number of 128 bits, so its bytes stand reversed.
+// says. All numbers are big-endian; an address counts as one number of 128 bits, so its bytes are reversed.
 //
-// What comes from a peer is bounded here: an id is a place in an array and has to be a valid one, a size has
-// to be the type's, a length has to lie within the buffer. An attribute marked invalid or absent has no value
-// to take; whatever stands in its place is passed over.
+// What comes from a peer is checked before anything is made of it: the id has to be a valid one, the size
+// that of the type, the length within the buffer, and no NUL inside a text. An attribute marked invalid or
+// absent has no value; whatever is in its place is skipped.
 #include <algorithm>
+#include <cstdlib>
 #include <cstring>
 
 #include "mgmt/bnode.h"
@@ -13,20 +14,17 @@
 #include "runtime/guards.h"
 #include "runtime/logging.h"
 
-enum : uint32_t { kind_wire_order = 1, kind_stored_order = 2, kind_counted = 4 };
-constexpr uint32_t HEADER_SIZE = 16, TYPE_OFFSET = 8, VALUE_OFFSET = 20;
+constexpr uint32_t HEADER_SIZE = 16, TYPE_OFFSET = 8;
 constexpr uint32_t ADDRESS_SIZE = 16;
+static constexpr uint32_t stored_address = offsetof(lc_ipaddr, address);
+static_assert(stored_address == offsetof(lc_ipprefix, address));
+static_assert(offsetof(lc_ipprefix, family) == 0 && offsetof(lc_ipprefix, mask_length) == 1);
 
-static lc_status put_number(tbuffer *buffer, uint32_t offset, uint32_t value) {
-    return tb_put_uint32(buffer, offset, raw_word(to_be32(value)));
-}
-static lc_status get_number(const tbuffer *buffer, uint32_t offset, uint32_t *out) {
-    CHECK_STATUS(tb_get_uint32(buffer, offset, out));
-    *out = to_host(from_raw_word(*out));
-    return LC_OK;
+static bool has_value(uint32_t flags) {
+    return !(flags & bn_flag_no_value);
 }
 
-// Stored bytes to wire bytes and back: numbers and addresses are turned around, a mask length behind an
+// Stored bytes to wire bytes and back: numbers and addresses are turned around, a mask length after an
 // address keeps its place.
 static void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
     static_assert(std::endian::native == std::endian::little);
@@ -35,226 +33,60 @@ static void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
     memcpy(to + turned, from + turned, size - turned);
 }
 
-static lc_status put_header(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t kind) {
-    CHECK_NULL(attrib);
-    CHECK_STATUS(put_number(buffer, offset, kind));
-    CHECK_STATUS(put_number(buffer, offset + 4, attrib->attribute_id));
-    CHECK_STATUS(put_number(buffer, offset + TYPE_OFFSET, attrib->type));
-    CHECK_STATUS(put_number(buffer, offset + 12, attrib->type_flags));
+// ---- Writing
+
+static lc_status put_number(tbuffer *buffer, uint32_t offset, uint32_t value) {
+    return tb_put_uint32(buffer, offset, raw_word(to_be32(value)));
+}
+// Both give the bytes that they wrote.
+static lc_status put_sized(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t size,
+                           uint32_t *out) {
+    CHECK_STATUS(put_number(buffer, offset, size));
+    CHECK_STATUS(tb_put_buf(buffer, offset + 4, bytes, size));
+    *out = 4 + size;
     return LC_OK;
 }
-
-// A new attribute with what the header says of it. On failure `out` is freed by its owner.
-static lc_status get_header(const tbuffer *buffer, uint32_t offset, uint32_t type, uint32_t kind,
-                            bn_attrib **out) {
-    CHECK_STATUS(bn_attrib_new(out));
-    bn_attrib *attrib = *out;
-    uint32_t kind_read = 0, type_read = 0, flags = 0;
-    CHECK_STATUS(get_number(buffer, offset, &kind_read));
-    CHECK_STATUS(get_number(buffer, offset + 4, &attrib->attribute_id));
-    CHECK_STATUS(get_number(buffer, offset + TYPE_OFFSET, &type_read));
-    CHECK_STATUS(get_number(buffer, offset + 12, &flags));
-    if (kind_read != kind)
-        FAIL_WITH(LC_GENERIC);
-    if (type_read != type && type_read != 0) {
-        LC_LOG(LC_LOG_ERR, "Attribute of type %s, expected %s",
-               lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(type_read)),
-               lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(type)));
-        return LC_GENERIC;
+static lc_status put_value(const bn_type_row *row, const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+                           uint32_t *out) {
+    if (row->shape == value_shape::text) {
+        const tstring *text = attrib->value.string;
+        const uint32_t length = text ? static_cast<uint32_t>(text->length) : 0;
+        return put_sized(buffer, offset, ts_str_maybe(text), length, out);
     }
-    CHECK_CONDITION(bn_attrib_id_valid(attrib->attribute_id));
-    attrib->type = type;
-    attrib->type_flags = flags & ~BN_TYPE_MASK;
-    return LC_OK;
-}
-
-static bool has_value(const bn_attrib *attrib) {
-    return !(attrib->type_flags & bn_flag_no_value);
-}
-
-// ---- Values in place behind a size
-
-static lc_status write_sized(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t kind,
-                             uint32_t *out_written) {
-    CHECK_STATUS(put_header(attrib, buffer, offset, kind));
-    const uint32_t size = attrib->value_size;
+    if (row->shape == value_shape::binary) {
+        const tbuffer *binary = attrib->value.binary;
+        return put_sized(buffer, offset, tb_buf_maybe(binary), binary ? binary->length : 0, out);
+    }
     uint8_t bytes[sizeof attrib->value.bytes];
+    const uint32_t leading = row->wire->leading, size = attrib->value_size;
+    if (leading) {
+        memcpy(bytes, attrib->value.bytes, leading);
+        turn(attrib->value.bytes + stored_address, bytes + leading, ADDRESS_SIZE);
+        *out = leading + ADDRESS_SIZE;
+        return tb_put_buf(buffer, offset, bytes, *out);
+    }
     CHECK_CONDITION(size <= sizeof bytes);
-    if (kind == kind_wire_order)
+    if (row->wire->kind == wire_kind_number)
         turn(attrib->value.bytes, bytes, size);
     else
         memcpy(bytes, attrib->value.bytes, size);
-    CHECK_STATUS(put_number(buffer, offset + HEADER_SIZE, size));
-    CHECK_STATUS(tb_put_buf(buffer, offset + VALUE_OFFSET, bytes, size));
-    if (out_written)
-        *out_written = VALUE_OFFSET + size;
-    return LC_OK;
+    return put_sized(buffer, offset, bytes, size, out);
 }
-
-static lc_status read_sized(const tbuffer *buffer, uint32_t offset, uint32_t type, uint32_t kind,
-                            bn_attrib **out, uint32_t *out_used) {
-    CHECK_NULL(out);
-    *out = nullptr;
-    owned<bn_attrib, bn_release_attrib> attrib;
-    CHECK_STATUS(get_header(buffer, offset, type, kind, &attrib.pointer));
-    const bn_type_row *row = bn_type_find(type);
-    CHECK_NULL(row);
-    uint32_t size = 0;
-    CHECK_STATUS(get_number(buffer, offset + HEADER_SIZE, &size));
-    const bool empty = size == 0 && (attrib.pointer->type_flags & bn_flag_absent);
-    if (size != row->size && !empty)
-        FAIL_WITH(LC_GENERIC);
-    const uint32_t at = offset + VALUE_OFFSET;
-    CHECK_CONDITION(at <= buffer->length && size <= buffer->length - at);
-    if (has_value(attrib.pointer) && kind == kind_wire_order)
-        turn(buffer->buffer + at, attrib.pointer->value.bytes, size);
-    else if (has_value(attrib.pointer))
-        memcpy(attrib.pointer->value.bytes, buffer->buffer + at, size);
-    if (!(attrib.pointer->type_flags & bn_flag_absent))
-        attrib.pointer->value_size = size;
-    *out = attrib.take();
-    if (out_used)
-        *out_used = VALUE_OFFSET + size;
-    return LC_OK;
-}
-lc_status bn_wire_write_number(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                               uint32_t *out_written) {
-    return write_sized(attrib, buffer, offset, kind_wire_order, out_written);
-}
-lc_status bn_wire_read_number(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                              uint32_t *out_used) {
-    return read_sized(buffer, offset, type, kind_wire_order, out, out_used);
-}
-lc_status bn_wire_write_bytes(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                              uint32_t *out_written) {
-    return write_sized(attrib, buffer, offset, kind_stored_order, out_written);
-}
-lc_status bn_wire_read_bytes(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                             uint32_t *out_used) {
-    return read_sized(buffer, offset, type, kind_stored_order, out, out_used);
-}
-
-// ---- Addresses: one or two leading bytes of the stored record, then the address
-
-static constexpr uint32_t stored_address = offsetof(lc_ipaddr, address);
-static_assert(stored_address == offsetof(lc_ipprefix, address));
-static_assert(offsetof(lc_ipprefix, family) == 0 && offsetof(lc_ipprefix, mask_length) == 1);
-
-static lc_status write_address(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t leading,
-                               uint32_t *out_written) {
-    CHECK_STATUS(put_header(attrib, buffer, offset, kind_wire_order));
-    uint8_t address[ADDRESS_SIZE];
-    turn(attrib->value.bytes + stored_address, address, ADDRESS_SIZE);
-    CHECK_STATUS(tb_put_buf(buffer, offset + HEADER_SIZE, attrib->value.bytes, leading));
-    CHECK_STATUS(tb_put_buf(buffer, offset + HEADER_SIZE + leading, address, ADDRESS_SIZE));
-    if (out_written)
-        *out_written = HEADER_SIZE + leading + ADDRESS_SIZE;
-    return LC_OK;
-}
-static lc_status read_address(const tbuffer *buffer, uint32_t offset, uint32_t type, uint32_t leading,
-                              bn_attrib **out, uint32_t *out_used) {
-    CHECK_NULL(out);
-    *out = nullptr;
-    owned<bn_attrib, bn_release_attrib> attrib;
-    CHECK_STATUS(get_header(buffer, offset, type, kind_wire_order, &attrib.pointer));
-    uint8_t address[ADDRESS_SIZE];
-    CHECK_STATUS(tb_get_uint128(buffer, offset + HEADER_SIZE + leading, address));
-    if (has_value(attrib.pointer)) {
-        memcpy(attrib.pointer->value.bytes, buffer->buffer + offset + HEADER_SIZE, leading);
-        turn(address, attrib.pointer->value.bytes + stored_address, ADDRESS_SIZE);
-    }
-    if (!(attrib.pointer->type_flags & bn_flag_absent))
-        attrib.pointer->value_size = sizeof(lc_ipaddr);
-    *out = attrib.take();
-    if (out_used)
-        *out_used = HEADER_SIZE + leading + ADDRESS_SIZE;
-    return LC_OK;
-}
-lc_status bn_wire_write_ipaddr(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                               uint32_t *out_written) {
-    return write_address(attrib, buffer, offset, 1, out_written);
-}
-lc_status bn_wire_read_ipaddr(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                              uint32_t *out_used) {
-    return read_address(buffer, offset, type, 1, out, out_used);
-}
-lc_status bn_wire_write_ipprefix(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                                 uint32_t *out_written) {
-    return write_address(attrib, buffer, offset, 2, out_written);
-}
-lc_status bn_wire_read_ipprefix(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                                uint32_t *out_used) {
-    return read_address(buffer, offset, type, 2, out, out_used);
-}
-
-// ---- Counted values
-
-static lc_status write_counted(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, const void *bytes,
-                               uint32_t length, uint32_t *out_written) {
-    CHECK_STATUS(put_header(attrib, buffer, offset, kind_counted));
-    CHECK_STATUS(put_number(buffer, offset + HEADER_SIZE, length));
-    CHECK_STATUS(tb_put_buf(buffer, offset + VALUE_OFFSET, bytes, length));
-    if (out_written)
-        *out_written = VALUE_OFFSET + length;
-    return LC_OK;
-}
-lc_status bn_wire_write_text(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                             uint32_t *out_written) {
+lc_status bn_wire_write(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t *out_written) {
     CHECK_NULL(attrib);
-    const tstring *text = attrib->value.string;
-    return write_counted(attrib, buffer, offset, ts_str_maybe(text),
-                         text ? static_cast<uint32_t>(text->length) : 0, out_written);
-}
-lc_status bn_wire_write_binary(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                               uint32_t *out_written) {
-    CHECK_NULL(attrib);
-    const tbuffer *bytes = attrib->value.binary;
-    return write_counted(attrib, buffer, offset, tb_buf_maybe(bytes), bytes ? bytes->length : 0, out_written);
-}
-
-static lc_status take_text(bn_attrib *attrib, char **inout_bytes, uint32_t length) {
-    CHECK_STATUS(ts_new_str_takeover(&attrib->value.string, inout_bytes, static_cast<int32_t>(length), -1));
-    // A peer's text that isn't UTF-8 after all is told in the log and stays a plain text.
-    if (attrib->type == bn_type_utf8_string)
-        LOG_STATUS(ts_set_utf8(attrib->value.string, 1));
+    CHECK_NULL(buffer);
+    const bn_type_row *row = bn_type_find(attrib->type);
+    CHECK_CONDITION(row && row->wire);
+    const be32 header[] = {to_be32(row->wire->kind), to_be32(attrib->attribute_id), to_be32(attrib->type),
+                           to_be32(attrib->type_flags)};
+    static_assert(sizeof header == HEADER_SIZE);
+    uint32_t written = 0;
+    CHECK_STATUS(tb_put_buf(buffer, offset, header, sizeof header));
+    CHECK_STATUS(put_value(row, attrib, buffer, offset + HEADER_SIZE, &written));
+    if (out_written)
+        *out_written = HEADER_SIZE + written;
     return LC_OK;
 }
-static lc_status take_binary(bn_attrib *attrib, char **inout_bytes, uint32_t length) {
-    auto *bytes = reinterpret_cast<uint8_t *>(*inout_bytes);
-    const lc_status status = tb_new_takeover(&attrib->value.binary, &bytes, length, length);
-    *inout_bytes = reinterpret_cast<char *>(bytes);
-    return status;
-}
-static lc_status read_counted(const tbuffer *buffer, uint32_t offset, uint32_t type,
-                              lc_status (*take)(bn_attrib *, char **, uint32_t), bn_attrib **out,
-                              uint32_t *out_used) {
-    CHECK_NULL(out);
-    *out = nullptr;
-    owned<bn_attrib, bn_release_attrib> attrib;
-    owned_text bytes;
-    uint32_t length = 0, used = 0;
-    CHECK_STATUS(get_header(buffer, offset, type, kind_counted, &attrib.pointer));
-    CHECK_STATUS(tb_get_str(buffer, offset + HEADER_SIZE, -1, 0, 1, 1, &bytes.pointer, &length, &used));
-    if (has_value(attrib.pointer)) {
-        CHECK_STATUS(take(attrib.pointer, &bytes.pointer, length));
-        attrib.pointer->value_size = length;
-    }
-    *out = attrib.take();
-    if (out_used)
-        *out_used = HEADER_SIZE + used;
-    return LC_OK;
-}
-lc_status bn_wire_read_text(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                            uint32_t *out_used) {
-    return read_counted(buffer, offset, type, take_text, out, out_used);
-}
-lc_status bn_wire_read_binary(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                              uint32_t *out_used) {
-    return read_counted(buffer, offset, type, take_binary, out, out_used);
-}
-
-// ---- Through the table
-
 lc_status bn_attrib_append_wire(const bn_attrib *attrib, tbuffer *buffer) {
     CHECK_NULL(attrib);
     CHECK_NULL(buffer);
@@ -268,14 +100,144 @@ lc_status bn_attrib_append_wire(const bn_attrib *attrib, tbuffer *buffer) {
     CHECK_STATUS(row->write(attrib, buffer, buffer->length, nullptr));
     return LC_OK;
 }
-lc_status bn_attrib_read_wire(const tbuffer *buffer, uint32_t offset, bn_attrib **out, uint32_t *out_used) {
+
+// ---- Reading
+
+static uint32_t number_at(const uint8_t *bytes) {
+    be32 wire;
+    memcpy(wire.bytes, bytes, sizeof wire);
+    return to_host(wire);
+}
+lc_status bn_check_text(const uint8_t *bytes, uint32_t length) {
+    const void *nul = length ? memchr(bytes, 0, length) : nullptr;
+    if (!nul)
+        return LC_OK;
+    LC_LOG(LC_LOG_ERR, "Received string of %u bytes has a NUL at %u", length,
+           static_cast<uint32_t>(static_cast<const uint8_t *>(nul) - bytes));
+    return LC_ASSERTION;
+}
+static lc_status check_type(uint32_t found, uint32_t expected) {
+    if (found == expected || found == 0)
+        return LC_OK;
+    LC_LOG(LC_LOG_ERR, "Attribute of type %s, expected %s",
+           lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(found)),
+           lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(expected)));
+    return LC_GENERIC;
+}
+// `at` is where the family's part begins, with `rest` bytes from there on.
+static lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t rest) {
+    const bn_type_row *row = out->row;
+    if (row->wire->leading) {
+        out->value = at;
+        out->length = row->wire->leading + ADDRESS_SIZE;
+        CHECK_CONDITION(out->length <= rest);
+        return LC_OK;
+    }
+    CHECK_CONDITION(rest >= 4);
+    out->value = at + 4;
+    out->length = number_at(at);
+    rest -= 4;
+    if (row->wire->kind == wire_kind_counted) {
+        if (out->length > rest)
+            FAIL_WITH(LC_NO_BUFFER_SPACE);
+        if (row->shape == value_shape::text)
+            CHECK_QUIET(bn_check_text(out->value, out->length));
+        return LC_OK;
+    }
+    if (out->length != row->size && !(out->length == 0 && (out->flags & bn_flag_absent)))
+        FAIL_WITH(LC_GENERIC);
+    CHECK_CONDITION(out->length <= rest);
+    return LC_OK;
+}
+lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_wire_attrib *out) {
+    CHECK_NULL(buffer);
+    CHECK_CONDITION(offset <= buffer->length && HEADER_SIZE <= buffer->length - offset);
+    const uint8_t *at = buffer->buffer + offset;
+    const uint32_t type_found = number_at(at + TYPE_OFFSET);
+    if (!type)
+        type = type_found;
+    CHECK_CONDITION(type >= 1 && type <= BN_TYPE_LAST);
+    const bn_type_row *row = bn_type_find(type);
+    CHECK_NULL(row);
+    CHECK_NULL(row->wire);
+    if (number_at(at) != row->wire->kind)
+        FAIL_WITH(LC_GENERIC);
+    CHECK_QUIET(check_type(type_found, type));
+    *out = {row, number_at(at + 4), number_at(at + 12) & ~BN_TYPE_MASK, nullptr, 0, 0};
+    CHECK_CONDITION(bn_attrib_id_valid(out->id));
+    CHECK_QUIET(locate_value(out, at + HEADER_SIZE, buffer->length - offset - HEADER_SIZE));
+    out->used = static_cast<uint32_t>(out->value - at) + out->length;
+    return LC_OK;
+}
+
+bool bn_wire_has_text(const bn_wire_attrib *found) {
+    return found->row->wire->kind == wire_kind_counted && has_value(found->flags);
+}
+static void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
+    const uint32_t leading = found->row->wire->leading;
+    if (!(found->flags & bn_flag_absent))
+        out->value_size = found->row->size;
+    if (!has_value(found->flags))
+        return;
+    if (leading) {
+        memcpy(out->value.bytes, found->value, leading);
+        turn(found->value + leading, out->value.bytes + stored_address, ADDRESS_SIZE);
+    } else if (found->row->wire->kind == wire_kind_number) {
+        turn(found->value, out->value.bytes, found->length);
+    } else {
+        memcpy(out->value.bytes, found->value, found->length);
+    }
+}
+// A peer's text that isn't UTF-8 after all is reported in the log and stays a plain text.
+static void mark_utf8(bn_attrib *attrib) {
+    if (attrib->type == bn_type_utf8_string)
+        LOG_STATUS(ts_set_utf8(attrib->value.string, 1));
+}
+void bn_wire_fill(const bn_wire_attrib *found, char *text, bn_attrib *out) {
+    out->attribute_id = found->id;
+    out->type = found->row->number;
+    out->type_flags = found->flags;
+    if (found->row->wire->kind != wire_kind_counted) {
+        fill_in_place(found, out);
+    } else if (text) {
+        bn_attrib_place_value(out, text, found->length);
+        mark_utf8(out);
+    }
+}
+
+static lc_status take_copy(const bn_wire_attrib *found, bn_attrib *attrib) {
+    owned_text bytes(static_cast<char *>(malloc(size_t{found->length} + 1)));
+    CHECK_NULL(bytes.pointer);
+    memcpy(bytes.pointer, found->value, found->length);
+    bytes.pointer[found->length] = 0;
+    attrib->value_size = found->length;
+    if (found->row->shape == value_shape::text) {
+        CHECK_STATUS(ts_new_str_takeover(&attrib->value.string, &bytes.pointer,
+                                         static_cast<int32_t>(found->length), -1));
+        mark_utf8(attrib);
+        return LC_OK;
+    }
+    auto *taken = reinterpret_cast<uint8_t *>(bytes.take());
+    const lc_status status = tb_new_takeover(&attrib->value.binary, &taken, found->length, found->length);
+    free(taken);
+    return status;
+}
+lc_status bn_wire_read(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
+                       uint32_t *out_used) {
     CHECK_NULL(out);
     *out = nullptr;
-    uint32_t type = 0;
-    CHECK_CONDITION(offset <= tb_size_max);
-    CHECK_STATUS(get_number(buffer, offset + TYPE_OFFSET, &type));
-    CHECK_CONDITION(type >= 1 && type <= BN_TYPE_LAST);
-    CHECK_NULL(bn_attrib_copy_funcs[type].read);
-    CHECK_STATUS(bn_attrib_copy_funcs[type].read(buffer, offset, type, out, out_used));
+    bn_wire_attrib found{};
+    CHECK_QUIET(bn_wire_locate(buffer, offset, type, &found));
+    owned<bn_attrib, bn_release_attrib> attrib;
+    CHECK_STATUS(bn_attrib_new(&attrib.pointer));
+    bn_wire_fill(&found, nullptr, attrib.pointer);
+    if (bn_wire_has_text(&found))
+        CHECK_STATUS(take_copy(&found, attrib.pointer));
+    *out = attrib.take();
+    if (out_used)
+        *out_used = found.used;
     return LC_OK;
+}
+lc_status bn_attrib_read_wire(const tbuffer *buffer, uint32_t offset, bn_attrib **out, uint32_t *out_used) {
+    return bn_wire_read(buffer, offset, 0, out, out_used);
 }

@@ -9,16 +9,50 @@
 
 constexpr char SEPARATOR = '/', ESCAPE = '\\';
 
+const char *bn_part_end(const char *part) {
+    for (; *part && *part != SEPARATOR; part++)
+        part += bn_escapes(part);
+    return part;
+}
+// Copies a part without its escapes, with a NUL after it.
+static uint32_t copy_part(const char *part, const char *end, char *out) {
+    char *at = out;
+    for (; part < end; part++) {
+        part += bn_escapes(part);
+        *at++ = *part;
+    }
+    *at = 0;
+    return static_cast<uint32_t>(at - out);
+}
+static uint32_t parts_from(const char *name) {
+    uint32_t count = 1;
+    for (name = bn_part_end(name); *name; name = bn_part_end(name + 1))
+        count++;
+    return count;
+}
 lc_status bn_binding_name_to_parts(const char *name, tstr_array **out_parts, int *out_absolute) {
     CHECK_NULL(out_parts);
     *out_parts = nullptr;
     CHECK_NULL(name);
+    const bool absolute = name[0] == SEPARATOR;
     if (out_absolute)
-        *out_absolute = name[0] == SEPARATOR;
-    CHECK_STATUS(ts_tokenize_str(name, SEPARATOR, ESCAPE, 0,
-                                 ts_tok_keep_empty | ts_tok_skip_leading | ts_tok_empty_is_null, out_parts));
-    if (!*out_parts)
-        CHECK_STATUS(tstr_array_new(out_parts, nullptr));
+        *out_absolute = absolute;
+    const char *part = name + absolute;
+    if (!*part)
+        return tstr_array_new(out_parts, nullptr);
+    const size_t length = strlen(part);
+    CHECK_CONDITION(length < ts_size_max);
+    const uint32_t count = parts_from(part);
+    tstring *records = nullptr;
+    char *text = nullptr;
+    CHECK_STATUS(tstr_array_new_packed(out_parts, count, length + 1, &records, &text));
+    for (uint32_t i = 0; i < count; i++) {
+        const char *end = bn_part_end(part);
+        const uint32_t copied = copy_part(part, end, text);
+        ts_place(&records[i], text, static_cast<int32_t>(copied));
+        text += copied + 1;
+        part = end + 1;
+    }
     return LC_OK;
 }
 lc_status bn_binding_name_parts_to_name_tstr(const tstr_array *parts, int absolute, tstring **out) {
@@ -44,11 +78,6 @@ bn_pattern::~bn_pattern() {
     (void)tstr_array_free(&parts);
 }
 
-const char *bn_part_end(const char *part) {
-    for (; *part && *part != SEPARATOR; part++)
-        part += bn_escapes(part);
-    return part;
-}
 static bool part_equals(const char *name, const char *end, const tstring *part) {
     const char *wanted = part->buffer;
     for (; name < end; name++, wanted++) {
@@ -60,12 +89,6 @@ static bool part_equals(const char *name, const char *end, const tstring *part) 
 }
 static bool is_text(const tstring *part, const char *text) {
     return strcmp(part->buffer, text) == 0;
-}
-static uint32_t parts_from(const char *name) {
-    uint32_t count = 1;
-    for (name = bn_part_end(name); *name; name = bn_part_end(name + 1))
-        count++;
-    return count;
 }
 
 bool bn_pattern_matches(const bn_pattern *pattern, const char *name) {

@@ -1,10 +1,12 @@
 // Messages in memory: requests and responses are made, filled, read and freed here, and nothing of them is
-// kept anywhere else. bnode_proto_wire.cpp turns them into bytes and back, bnode_proto_session.cpp sends them.
+// kept anywhere else. bnode_proto_wire.cpp turns them into bytes and back, bnode_proto_session.cpp sends
+// them.
 #include "mgmt/bnode_proto.h"
 
 #include <cstdlib>
 #include <cstring>
 
+#include "mgmt/bnode_block.h"
 #include "mgmt/bnode_proto_arrays.h"
 #include "runtime/logging.h"
 
@@ -60,67 +62,48 @@ void bn_request_node_free(bn_request_node *node) {
     (void)bn_binding_free(&node->binding);
     ts_free(&node->source);
     ts_free(&node->target);
-    free(node);
+    if (!node->placed)
+        free(node);
 }
 void bn_response_node_free(bn_response_node *node) {
     if (!node)
         return;
     (void)bn_binding_free(&node->binding);
-    free(node);
+    if (!node->placed)
+        free(node);
 }
 
-void bn_request_per_node_free_for_array(void *node) {
+static void free_request_node(void *node) {
     bn_request_node_free(static_cast<bn_request_node *>(node));
 }
-void bn_response_per_node_free_for_array(void *node) {
+static void free_response_node(void *node) {
     bn_response_node_free(static_cast<bn_response_node *>(node));
 }
-
-// What nodes of both kinds have. On failure `out` is freed by its owner.
-template <typename Node>
-static lc_status copy_node(const Node *node, Node **out) {
-    *out = static_cast<Node *>(calloc(1, sizeof(Node)));
-    CHECK_NULL(*out);
-    (*out)->node_id = node->node_id;
-    (*out)->msg_type = node->msg_type;
-    if (node->binding)
-        CHECK_STATUS(bn_binding_dup(node->binding, &(*out)->binding));
-    return LC_OK;
-}
-lc_status bn_request_per_node_dup_for_array(const void *element, void **out_copy) {
-    CHECK_NULL(out_copy);
-    *out_copy = nullptr;
-    const bn_request_node *node = static_cast<const bn_request_node *>(element);
-    owned_request_node copy;
-    CHECK_STATUS(copy_node(node, &copy.pointer));
-    copy.pointer->subop = node->subop;
-    copy.pointer->flags = node->flags;
-    if (node->source)
-        CHECK_STATUS(ts_dup(node->source, &copy.pointer->source));
-    if (node->target)
-        CHECK_STATUS(ts_dup(node->target, &copy.pointer->target));
-    *out_copy = copy.take();
-    return LC_OK;
-}
-lc_status bn_response_per_node_dup_for_array(const void *element, void **out_copy) {
-    CHECK_NULL(out_copy);
-    *out_copy = nullptr;
-    owned_response_node copy;
-    CHECK_STATUS(copy_node(static_cast<const bn_response_node *>(element), &copy.pointer));
-    *out_copy = copy.take();
-    return LC_OK;
-}
-
 static void fill_request_nodes(array_options *options) {
-    options->duplicate = bn_request_per_node_dup_for_array;
-    options->free = bn_request_per_node_free_for_array;
+    options->free = free_request_node;
 }
 static void fill_response_nodes(array_options *options) {
-    options->duplicate = bn_response_per_node_dup_for_array;
-    options->free = bn_response_per_node_free_for_array;
+    options->free = free_response_node;
 }
 TYPED_ARRAY_DEFINE(bn_request_per_node_array, bn_request_node *, fill_request_nodes)
 TYPED_ARRAY_DEFINE(bn_response_per_node_array, bn_response_node *, fill_response_nodes)
+
+// Options for an array that is going to have `count` elements.
+static array_options options_for(uint32_t count, void (*fill)(array_options *)) {
+    array_options options = {};
+    (void)array_options_get_defaults(&options);
+    fill(&options);
+    options.initial_size = count ? count : 1;
+    return options;
+}
+lc_status bn_request_nodes_new(bn_request_per_node_array **out, uint32_t count) {
+    const array_options options = options_for(count, fill_request_nodes);
+    return bn_request_per_node_array_new_full(out, &options);
+}
+lc_status bn_response_nodes_new(bn_response_per_node_array **out, uint32_t count) {
+    const array_options options = options_for(count, fill_response_nodes);
+    return bn_response_per_node_array_new_full(out, &options);
+}
 
 // ---- Requests
 
@@ -130,18 +113,24 @@ lc_status bn_request_msg_free(bn_request_msg **inout) {
     ts_free(&(*inout)->audit_user);
     ts_free(&(*inout)->text);
     (void)bn_request_per_node_array_free(&(*inout)->nodes);
+    bn_block_release((*inout)->block);
     free(*inout);
     *inout = nullptr;
     return LC_OK;
 }
 
+lc_status bn_request_msg_new(bn_request_msg **out, uint16_t type) {
+    *out = static_cast<bn_request_msg *>(calloc(1, sizeof(bn_request_msg)));
+    CHECK_NULL(*out);
+    (*out)->msg_type = type;
+    (*out)->next_node_id = FIRST_NODE_ID;
+    return LC_OK;
+}
 lc_status bn_request_msg_create(bn_request_msg **out, uint16_t type) {
     CHECK_NULL(out);
     *out = nullptr;
-    owned_request msg(static_cast<bn_request_msg *>(calloc(1, sizeof(bn_request_msg))));
-    CHECK_NULL(msg.pointer);
-    msg.pointer->msg_type = type;
-    msg.pointer->next_node_id = FIRST_NODE_ID;
+    owned_request msg;
+    CHECK_STATUS(bn_request_msg_new(&msg.pointer, type));
     CHECK_STATUS(bn_request_per_node_array_new(&msg.pointer->nodes));
     *out = msg.take();
     return LC_OK;
@@ -314,18 +303,24 @@ lc_status bn_response_msg_free(bn_response_msg **inout) {
         return LC_OK;
     ts_free(&(*inout)->return_message);
     (void)bn_response_per_node_array_free(&(*inout)->nodes);
+    bn_block_release((*inout)->block);
     free(*inout);
     *inout = nullptr;
     return LC_OK;
 }
 
+lc_status bn_response_msg_new(bn_response_msg **out, uint16_t type) {
+    *out = static_cast<bn_response_msg *>(calloc(1, sizeof(bn_response_msg)));
+    CHECK_NULL(*out);
+    (*out)->msg_type = type;
+    return LC_OK;
+}
 lc_status bn_response_msg_create(bn_response_msg **out, uint16_t type, uint32_t response_to,
                                  uint32_t return_code, const char *message) {
     CHECK_NULL(out);
     *out = nullptr;
-    owned_response msg(static_cast<bn_response_msg *>(calloc(1, sizeof(bn_response_msg))));
-    CHECK_NULL(msg.pointer);
-    msg.pointer->msg_type = type;
+    owned_response msg;
+    CHECK_STATUS(bn_response_msg_new(&msg.pointer, type));
     msg.pointer->response_to = response_to;
     msg.pointer->return_code = return_code;
     if (message)
@@ -367,18 +362,49 @@ lc_status bn_query_response_msg_append_binding_takeover(bn_response_msg *msg, bn
     return LC_OK;
 }
 
+static lc_status copy_node(const bn_response_node *node, bn_block_builder *builder, bn_response_msg *out) {
+    auto *copy = static_cast<bn_response_node *>(bn_place_record(builder, sizeof *node));
+    CHECK_NULL(copy);
+    copy->placed = true;
+    copy->node_id = node->node_id;
+    copy->msg_type = node->msg_type;
+    if (node->binding)
+        CHECK_STATUS(bn_place_copy(builder, node->binding, &copy->binding));
+    if (node->binding && node->binding->parts)
+        CHECK_STATUS(tstr_array_duplicate(node->binding->parts, &copy->binding->parts));
+    CHECK_STATUS(bn_response_per_node_array_append_takeover(out->nodes, &copy));
+    return LC_OK;
+}
+static lc_status copy_nodes(const bn_response_msg *msg, bn_response_msg *out) {
+    const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
+    CHECK_STATUS(bn_response_nodes_new(&out->nodes, count));
+    bn_block_size size = {};
+    for (uint32_t i = 0; i < count; i++) {
+        const bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
+        bn_size_record(&size, sizeof *node);
+        if (node->binding)
+            bn_size_copy(&size, node->binding);
+    }
+    bn_block_builder builder;
+    CHECK_STATUS(bn_block_new(&size, &builder));
+    out->block = builder.block;
+    for (uint32_t i = 0; i < count; i++)
+        CHECK_STATUS(copy_node(bn_response_per_node_array_get_quick(msg->nodes, i), &builder, out));
+    return LC_OK;
+}
 lc_status bn_response_msg_dup(const bn_response_msg *msg, bn_response_msg **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(msg);
-    owned_response copy(static_cast<bn_response_msg *>(malloc(sizeof *msg)));
-    CHECK_NULL(copy.pointer);
+    owned_response copy;
+    CHECK_STATUS(bn_response_msg_new(&copy.pointer, msg->msg_type));
     *copy.pointer = *msg;
     copy.pointer->return_message = nullptr;
     copy.pointer->nodes = nullptr;
+    copy.pointer->block = nullptr;
     if (msg->return_message)
         CHECK_STATUS(ts_dup(msg->return_message, &copy.pointer->return_message));
-    CHECK_STATUS(bn_response_per_node_array_duplicate(msg->nodes, &copy.pointer->nodes));
+    CHECK_STATUS(copy_nodes(msg, copy.pointer));
     *out = copy.take();
     return LC_OK;
 }
@@ -389,12 +415,59 @@ int32_t bn_request_get_msg_id(const bn_request_msg *msg) {
     return msg ? static_cast<int32_t>(msg->msg_id) : -1;
 }
 
-// Of a request: parts that the reader asked for are made now; the others go. A response keeps what it has.
+// Parts that the reader asked for are made now, from the name that has them all; the others go. A name of no
+// parts has none to make.
 static lc_status settle_parts(bn_binding *binding, int keep_parts) {
     if (!keep_parts)
         return bn_binding_drop_name_parts(binding);
-    if (!binding->parts)
-        CHECK_STATUS(bn_binding_name_to_parts(ts_str(binding->name), &binding->parts, nullptr));
+    const char *name = ts_str(binding->name);
+    if (!binding->parts && name[binding->absolute ? 1 : 0])
+        CHECK_STATUS(bn_binding_name_to_parts(name, &binding->parts, nullptr));
+    return LC_OK;
+}
+
+namespace {
+// Bindings on their way to a reader, with the ids of their nodes.
+struct reading {
+    owned_bindings bindings;
+    owned_uint32_array ids;
+};
+} // namespace
+
+static lc_status begin_reading(reading *into, uint32_t count) {
+    array_options options = {};
+    CHECK_STATUS(array_options_get_defaults(&options));
+    options.duplicate = array_std_assign_func;
+    options.initial_size = count ? count : 1;
+    CHECK_STATUS(uint32_array_new_full(&into->ids.pointer, &options));
+    CHECK_STATUS(bn_binding_array_new_sized(&into->bindings.pointer, count));
+    return LC_OK;
+}
+static lc_status take_into(reading *into, bn_binding **inout_binding, int keep_parts) {
+    CHECK_STATUS(settle_parts(*inout_binding, keep_parts));
+    CHECK_STATUS(bn_binding_array_append_takeover(into->bindings.pointer, inout_binding));
+    return LC_OK;
+}
+template <typename NodeArray, typename Get>
+static lc_status copy_bindings(const NodeArray *nodes, uint32_t count, Get get, int keep_parts,
+                               reading *into) {
+    bn_block_size size = {};
+    for (uint32_t i = 0; i < count; i++)
+        if (const bn_binding *binding = get(nodes, i)->binding)
+            bn_size_copy(&size, binding);
+    bn_block_builder builder;
+    CHECK_STATUS(bn_block_new(&size, &builder));
+    const owned_block held(builder.block);
+    for (uint32_t i = 0; i < count; i++) {
+        const bn_binding *binding = get(nodes, i)->binding;
+        owned_binding copy;
+        if (!binding)
+            continue;
+        CHECK_STATUS(bn_place_copy(&builder, binding, &copy.pointer));
+        if (keep_parts && binding->parts)
+            CHECK_STATUS(tstr_array_duplicate(binding->parts, &copy.pointer->parts));
+        CHECK_STATUS(take_into(into, &copy.pointer, keep_parts));
+    }
     return LC_OK;
 }
 
@@ -415,30 +488,27 @@ lc_status bn_request_get(const bn_request_msg *msg, uint16_t *out_type, const vo
     if (msg->msg_type % 2 == 0 || msg->msg_type > bn_msg_event)
         FAIL_WITH(LC_UNEXPECTED_CASE);
     const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
-    owned_bindings bindings;
-    owned_uint32_array ids;
+    reading read;
     owned_node_info info;
-    CHECK_STATUS(bn_binding_array_new(&bindings.pointer));
-    CHECK_STATUS(uint32_array_new(&ids.pointer));
+    CHECK_STATUS(begin_reading(&read, count));
     info.pointer = static_cast<bn_node_info *>(calloc(count ? count : 1, sizeof(bn_node_info)));
     CHECK_NULL(info.pointer);
     for (uint32_t i = 0; i < count; i++) {
         const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
-        owned_binding copy;
-        CHECK_STATUS(bn_binding_dup(node->binding, &copy.pointer));
-        CHECK_STATUS(settle_parts(copy.pointer, keep_parts));
-        CHECK_STATUS(bn_binding_array_append_takeover(bindings.pointer, &copy.pointer));
-        CHECK_STATUS(uint32_array_append(ids.pointer, node->node_id));
+        CHECK_STATUS(uint32_array_append(read.ids.pointer, node->node_id));
         info.pointer[i] = {node->subop, node->flags};
     }
+    if (out_bindings)
+        CHECK_STATUS(
+            copy_bindings(msg->nodes, count, bn_request_per_node_array_get_quick, keep_parts, &read));
     if (out_type)
         *out_type = msg->msg_type;
     if (out_body)
         *out_body = &msg->flags;
     if (out_bindings)
-        *out_bindings = bindings.take();
+        *out_bindings = read.bindings.take();
     if (out_node_ids)
-        *out_node_ids = ids.take();
+        *out_node_ids = read.ids.take();
     if (out_node_info)
         *out_node_info = info.take();
     return LC_OK;
@@ -454,14 +524,12 @@ lc_status bn_response_get_msg_ids(const bn_response_msg *msg, uint32_t *out_resp
     return LC_OK;
 }
 
-// Moves a node's binding out of the message, or copies it.
-static lc_status read_node(bn_response_node *node, bool take, bn_binding **out) {
-    if (take) {
-        *out = node->binding;
-        node->binding = nullptr;
-        return LC_OK;
+static lc_status move_bindings(const bn_response_msg *msg, uint32_t count, int keep_parts, reading *into) {
+    for (uint32_t i = 0; i < count; i++) {
+        bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
+        if (node->binding)
+            CHECK_STATUS(take_into(into, &node->binding, keep_parts));
     }
-    CHECK_STATUS(bn_binding_dup(node->binding, out));
     return LC_OK;
 }
 
@@ -477,36 +545,31 @@ static lc_status read_response(const bn_response_msg *msg, bool take, uint32_t *
     if (out_node_ids)
         *out_node_ids = nullptr;
     CHECK_NULL(msg);
-    owned_bindings bindings;
-    owned_uint32_array ids;
+    reading read;
     owned_tstring message;
-    CHECK_STATUS(bn_binding_array_new(&bindings.pointer));
-    CHECK_STATUS(uint32_array_new(&ids.pointer));
-    if (out_message && msg->return_message)
-        CHECK_STATUS(ts_dup(msg->return_message, &message.pointer));
     const uint32_t count =
         out_bindings || out_node_ids ? bn_response_per_node_array_length_quick(msg->nodes) : 0;
+    CHECK_STATUS(begin_reading(&read, count));
+    if (out_message && msg->return_message)
+        CHECK_STATUS(ts_dup(msg->return_message, &message.pointer));
     for (uint32_t i = 0; i < count; i++) {
-        bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
-        owned_binding binding;
-        if (!node->binding)
-            continue;
-        CHECK_STATUS(uint32_array_append(ids.pointer, node->node_id));
-        if (!out_bindings)
-            continue;
-        CHECK_STATUS(read_node(node, take, &binding.pointer));
-        if (!keep_parts)
-            CHECK_STATUS(bn_binding_drop_name_parts(binding.pointer));
-        CHECK_STATUS(bn_binding_array_append_takeover(bindings.pointer, &binding.pointer));
+        const bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
+        if (node->binding)
+            CHECK_STATUS(uint32_array_append(read.ids.pointer, node->node_id));
     }
+    if (out_bindings && take)
+        CHECK_STATUS(move_bindings(msg, count, keep_parts, &read));
+    else if (out_bindings)
+        CHECK_STATUS(
+            copy_bindings(msg->nodes, count, bn_response_per_node_array_get_quick, keep_parts, &read));
     if (out_code)
         *out_code = msg->return_code;
     if (out_message)
         *out_message = message.take();
     if (out_bindings)
-        *out_bindings = bindings.take();
+        *out_bindings = read.bindings.take();
     if (out_node_ids)
-        *out_node_ids = ids.take();
+        *out_node_ids = read.ids.take();
     return LC_OK;
 }
 

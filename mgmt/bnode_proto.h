@@ -51,12 +51,14 @@ extern const lc_enum_entry bn_msg_type_table[];
 extern const lc_enum_entry bn_query_subop_table[];
 extern const lc_enum_entry bn_set_subop_table[];
 
+struct bn_block; // bnode_block.h
 struct bn_request_node {
     uint32_t node_id;
     bn_binding *binding; // owned
     uint32_t msg_type;
     uint32_t subop; // query and set
     uint32_t flags;
+    uint32_t placed; // lies in the message's block
     tstring *source; // set, "reparent" only; owned
     tstring *target;
 };
@@ -64,6 +66,7 @@ struct bn_response_node {
     uint32_t node_id;
     bn_binding *binding; // owned
     uint32_t msg_type;
+    uint32_t placed; // lies in the message's block
 };
 TYPED_ARRAY_DECLARE(bn_request_per_node_array, bn_request_node *)
 TYPED_ARRAY_DECLARE(bn_response_per_node_array, bn_response_node *)
@@ -76,6 +79,7 @@ struct bn_request_msg {
     uint32_t transaction_id;
     tstring *audit_user; // or null
     bn_request_per_node_array *nodes;
+    bn_block *block;       // that its nodes lie in, of a received message; or null
     uint32_t flags;        // query: flags; set: commit flags
     tstring *text;         // query: database name; set: text; action: its name; event: its name
     uint32_t number;       // query: revision id condition; set: number
@@ -91,6 +95,7 @@ struct bn_response_msg {
     uint32_t return_code;
     tstring *return_message;
     bn_response_per_node_array *nodes;
+    bn_block *block;         // as in a request
     uint32_t db_revision_id; // query and set responses
 };
 

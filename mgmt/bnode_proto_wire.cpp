@@ -1,16 +1,20 @@
-// Messages on the wire. All integers are big-endian; a string is a 4-byte length and that many bytes. A
-// reader walks the received bytes and refuses to read past their end, so that no count that was announced is
-// believed further than the bytes that came with it.
+// Messages on the wire. All integers are big-endian; a string is a 4-byte length and that many bytes.
+//
+// A received message is read twice. The first pass checks all of it against the bytes that came, and adds up
+// what its nodes are going to take; only then is memory taken for them, all at once, and the second pass
+// fills it. The records are such that a node never takes more than eight times its bytes.
 #include <cstdlib>
 #include <cstring>
 
+#include "mgmt/bnode_block.h"
 #include "mgmt/bnode_names.h"
 #include "mgmt/bnode_proto.h"
 #include "mgmt/bnode_proto_arrays.h"
-#include "mgmt/bnode_types.h"
+#include "mgmt/bnode_rows.h"
 #include "runtime/byte_order.h"
 #include "runtime/logging.h"
 
+namespace {
 // The fixed parts, where their bytes lie.
 struct bn_wire_request_header {
     be16 service_id;
@@ -31,6 +35,7 @@ static_assert(sizeof(bn_wire_request_header) == 16 && offsetof(bn_wire_request_h
 static_assert(offsetof(bn_wire_request_header, length) == 4 && offsetof(bn_wire_request_header, msg_id) == 8);
 static_assert(offsetof(bn_wire_request_header, transaction_id) == 12);
 static_assert(sizeof(bn_wire_response_header) == 20 && offsetof(bn_wire_response_header, response_to) == 16);
+} // namespace
 
 static void bn_byte_swap_request_header(const bn_request_msg *msg, bn_wire_request_header *out) {
     *out = {to_be16(msg->service_id), to_be16(msg->msg_type), to_be32(msg->length), to_be32(msg->msg_id),
@@ -56,8 +61,7 @@ static void bn_byte_swap_response_header(const bn_wire_response_header *wire, bn
     msg->response_to = to_host(wire->response_to);
 }
 
-// --- Writing
-// --------------------------------------------------------------------------------------------------------
+// ---- Writing
 
 static lc_status put_u32(tbuffer *buffer, uint32_t value) {
     const be32 wire = to_be32(value);
@@ -143,6 +147,17 @@ static lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
     return LC_OK;
 }
 
+// What the two kinds of message have between the fixed part and the nodes.
+static lc_status put_head(tbuffer *buffer, const bn_request_msg *msg) {
+    CHECK_STATUS(put_string(buffer, msg->audit_user));
+    return LC_OK;
+}
+static lc_status put_head(tbuffer *buffer, const bn_response_msg *msg) {
+    CHECK_STATUS(put_u32(buffer, msg->return_code));
+    CHECK_STATUS(put_string(buffer, msg->return_message));
+    return LC_OK;
+}
+
 static lc_status put_subop(tbuffer *buffer, const bn_request_node *node) {
     CHECK_STATUS(put_u32(buffer, node->subop));
     CHECK_STATUS(put_u32(buffer, node->flags));
@@ -156,10 +171,6 @@ static lc_status put_set_node(tbuffer *buffer, const bn_request_node *node) {
     CHECK_STATUS(put_string(buffer, node->target));
     return LC_OK;
 }
-static lc_status put_no_node(tbuffer *, const bn_request_node *) {
-    return LC_OK;
-}
-
 // Query: flags, database, revision condition. Set: commit flags, text, number.
 static lc_status put_options(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_u32(buffer, msg->flags));
@@ -167,27 +178,36 @@ static lc_status put_options(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_u32(buffer, msg->number));
     return LC_OK;
 }
-static lc_status put_no_message(tbuffer *, const bn_request_msg *) {
-    return LC_OK;
-}
 static lc_status put_message_name(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_string(buffer, msg->text));
     return LC_OK;
 }
+static lc_status put_revision(tbuffer *buffer, const bn_response_msg *msg) {
+    CHECK_STATUS(put_u32(buffer, msg->db_revision_id));
+    return LC_OK;
+}
 
-// --- Reading
-// --------------------------------------------------------------------------------------------------------
+// ---- Reading
 
+namespace {
 struct wire_reader {
     const tbuffer *buffer;
-    uint32_t offset;
+    const uint8_t *at, *end;
 };
+// Bytes in the buffer that a length stands for.
+struct wire_text {
+    const uint8_t *bytes;
+    uint32_t length;
+};
+} // namespace
 
-static lc_status get_bytes(wire_reader *reader, void *out, uint32_t count) {
-    const uint32_t length = used(reader->buffer);
-    CHECK_CONDITION(reader->offset <= length && count <= length - reader->offset);
-    memcpy(out, tb_buf(reader->buffer) + reader->offset, count);
-    reader->offset += count;
+static size_t rest_of(const wire_reader *reader) {
+    return static_cast<size_t>(reader->end - reader->at);
+}
+static lc_status get_bytes(wire_reader *reader, void *out, size_t count) {
+    CHECK_CONDITION(count <= rest_of(reader));
+    memcpy(out, reader->at, count);
+    reader->at += count;
     return LC_OK;
 }
 static lc_status get_u32(wire_reader *reader, uint32_t *out) {
@@ -196,81 +216,37 @@ static lc_status get_u32(wire_reader *reader, uint32_t *out) {
     *out = to_host(wire);
     return LC_OK;
 }
+static lc_status find_text(wire_reader *reader, wire_text *out) {
+    CHECK_STATUS(get_u32(reader, &out->length));
+    if (out->length > rest_of(reader))
+        CHECK_STATUS(LC_NO_BUFFER_SPACE);
+    out->bytes = reader->at;
+    reader->at += out->length;
+    return LC_OK;
+}
+static lc_status find_string(wire_reader *reader, wire_text *out) {
+    CHECK_STATUS(find_text(reader, out));
+    CHECK_STATUS(bn_check_text(out->bytes, out->length));
+    CHECK_CONDITION(out->length < ts_size_max);
+    return LC_OK;
+}
 // An absent string and one of length 0 are the same on the wire; both come back as an empty one.
 static lc_status get_string(wire_reader *reader, tstring **out) {
-    uint32_t length = 0;
-    CHECK_STATUS(get_u32(reader, &length));
-    if (length > used(reader->buffer) - reader->offset)
-        CHECK_STATUS(LC_NO_BUFFER_SPACE);
-    owned_tstring text;
-    CHECK_STATUS(ts_new_size(&text.pointer, length + 1));
-    if (length > 0)
-        CHECK_STATUS(ts_append_str_frag(
-            text.pointer, reinterpret_cast<const char *>(tb_buf(reader->buffer)) + reader->offset, 0,
-            static_cast<int32_t>(length)));
-    reader->offset += length;
-    *out = text.take();
+    wire_text found = {};
+    CHECK_STATUS(find_string(reader, &found));
+    CHECK_STATUS(ts_new_size(out, found.length + 1));
+    CHECK_STATUS(ts_append_str_frag(*out, reinterpret_cast<const char *>(found.bytes), 0,
+                                    static_cast<int32_t>(found.length)));
     return LC_OK;
 }
 
-static lc_status get_parts(wire_reader *reader, tstr_array **out) {
-    uint32_t count = 0;
-    CHECK_STATUS(get_u32(reader, &count));
-    owned_tstr_array parts;
-    CHECK_STATUS(tstr_array_new(&parts.pointer, nullptr));
-    for (uint32_t i = 0; i < count; i++) {
-        owned_tstring part;
-        CHECK_STATUS(get_string(reader, &part.pointer));
-        CHECK_STATUS(tstr_array_append_takeover(parts.pointer, &part.pointer));
-    }
-    *out = parts.take();
+static lc_status get_head(wire_reader *reader, bn_request_msg *msg) {
+    CHECK_STATUS(get_string(reader, &msg->audit_user));
     return LC_OK;
 }
-
-static lc_status get_attribute(wire_reader *reader, bn_binding *binding) {
-    owned_attrib attribute;
-    uint32_t count = 0;
-    CHECK_STATUS(bn_attrib_read_wire(reader->buffer, reader->offset, &attribute.pointer, &count));
-    reader->offset += count;
-    CHECK_STATUS(bn_binding_set_attrib_takeover(binding, &attribute.pointer));
-    return LC_OK;
-}
-
-static lc_status get_binding(wire_reader *reader, bn_binding **out) {
-    uint8_t absolute = 0;
-    CHECK_STATUS(get_bytes(reader, &absolute, sizeof absolute));
-    owned_tstr_array parts;
-    CHECK_STATUS(get_parts(reader, &parts.pointer));
-    tstring *name = nullptr;
-    owned_binding binding;
-    CHECK_STATUS(bn_binding_new_parts_components_takeover(&binding.pointer, &name, &parts.pointer,
-                                                          absolute ? 1 : 0, nullptr));
-    // The name has them all, and they take more memory than everything else of a binding. What begins with an
-    // empty part reads as an absolute name from here on.
-    CHECK_STATUS(bn_binding_drop_name_parts(binding.pointer));
-    binding.pointer->absolute = bn_binding_get_name_quick(binding.pointer)[0] == '/';
-    uint32_t count = 0;
-    CHECK_STATUS(get_u32(reader, &count));
-    for (uint32_t i = 0; i < count; i++)
-        CHECK_STATUS(get_attribute(reader, binding.pointer));
-    *out = binding.take();
-    return LC_OK;
-}
-
-static lc_status get_subop(wire_reader *reader, bn_request_node *node) {
-    CHECK_STATUS(get_u32(reader, &node->subop));
-    CHECK_STATUS(get_u32(reader, &node->flags));
-    return LC_OK;
-}
-static lc_status get_set_node(wire_reader *reader, bn_request_node *node) {
-    CHECK_STATUS(get_subop(reader, node));
-    if (node->subop != bn_set_reparent)
-        return LC_OK;
-    CHECK_STATUS(get_string(reader, &node->source));
-    CHECK_STATUS(get_string(reader, &node->target));
-    return LC_OK;
-}
-static lc_status get_no_node(wire_reader *, bn_request_node *) {
+static lc_status get_head(wire_reader *reader, bn_response_msg *msg) {
+    CHECK_STATUS(get_u32(reader, &msg->return_code));
+    CHECK_STATUS(get_string(reader, &msg->return_message));
     return LC_OK;
 }
 static lc_status get_options(wire_reader *reader, bn_request_msg *msg) {
@@ -279,42 +255,276 @@ static lc_status get_options(wire_reader *reader, bn_request_msg *msg) {
     CHECK_STATUS(get_u32(reader, &msg->number));
     return LC_OK;
 }
-static lc_status get_no_message(wire_reader *, bn_request_msg *) {
-    return LC_OK;
-}
 static lc_status get_message_name(wire_reader *reader, bn_request_msg *msg) {
     CHECK_STATUS(get_string(reader, &msg->text));
     return LC_OK;
 }
-
-// --- Requests
-// -------------------------------------------------------------------------------------------------------
-
-// What a request of each type has behind its nodes and behind itself.
-struct request_trailers {
-    uint16_t msg_type;
-    lc_status (*put_node)(tbuffer *buffer, const bn_request_node *node);
-    lc_status (*get_node)(wire_reader *reader, bn_request_node *node);
-    lc_status (*put_message)(tbuffer *buffer, const bn_request_msg *msg);
-    lc_status (*get_message)(wire_reader *reader, bn_request_msg *msg);
-};
-static const request_trailers request_types[] = {
-    {bn_msg_query_request, put_subop, get_subop, put_options, get_options},
-    {bn_msg_set_request, put_set_node, get_set_node, put_options, get_options},
-    {bn_msg_action_request, put_no_node, get_no_node, put_message_name, get_message_name},
-    {bn_msg_event, put_no_node, get_no_node, put_message_name, get_message_name},
-};
-
-// A message of another type is told in the log and has no trailers; who receives one refuses it by its type,
-// and the session goes on.
-static const request_trailers *trailers_of(uint16_t type) {
-    static const request_trailers none = {0, put_no_node, get_no_node, put_no_message, get_no_message};
-    for (const request_trailers &known : request_types)
-        if (known.msg_type == type)
-            return &known;
-    LC_LOG(LC_LOG_ERR, "illegal messsage of type %d", type);
-    return &none;
+static lc_status get_revision(wire_reader *reader, bn_response_msg *msg) {
+    CHECK_STATUS(get_u32(reader, &msg->db_revision_id));
+    return LC_OK;
 }
+
+// ---- Nodes, read twice: measured and checked first, and then placed in the message's block
+
+namespace {
+// A name as text: its parts are joined, escaped, and an absolute one is led by a separator unless it begins
+// with one because its first part is empty.
+struct wire_name {
+    const uint8_t *first; // part
+    uint32_t parts;
+    bool leading;
+    bool absolute; // begins with a separator
+    bool bare;     // is "" or "/"
+    size_t length;
+};
+// What the first pass tells the second.
+struct message_extent {
+    bn_block_size size;
+    bool escapes; // some part of a name has characters to escape
+    bool checked; // the first pass is over
+};
+} // namespace
+
+static bool has_special(const wire_text *part) {
+    bool special = false;
+    for (uint32_t i = 0; i < part->length; i++) {
+        const uint8_t byte = part->bytes[i];
+        special |= byte == 0 || byte == '/' || byte == '\\';
+    }
+    return special;
+}
+// Writes a part with its escapes, or only counts with a null `out`. A backslash is escaped before a slash, be
+// it the separator that follows the part, and before another backslash.
+static size_t write_escaped(const wire_text *part, bool separated, char *out) {
+    const uint8_t *at = part->bytes, *end = at + part->length;
+    size_t length = 0;
+    for (; at < end; at++) {
+        const uint8_t next = at + 1 < end ? at[1] : separated ? '/' : 0;
+        const bool escaped = *at == '/' || (*at == '\\' && (next == '/' || next == '\\'));
+        if (out && escaped)
+            out[length] = '\\';
+        length += escaped;
+        if (out)
+            out[length] = static_cast<char>(*at);
+        length++;
+    }
+    return length;
+}
+static lc_status measure_part(const wire_text *part, bool separated, message_extent *extent,
+                              size_t *inout_length) {
+    if (!extent->checked && has_special(part)) {
+        CHECK_STATUS(bn_check_text(part->bytes, part->length));
+        extent->escapes = true;
+    }
+    *inout_length += extent->escapes ? write_escaped(part, separated, nullptr) : part->length;
+    return LC_OK;
+}
+// Goes past the name.
+static lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *out) {
+    uint8_t absolute = 0;
+    CHECK_STATUS(get_bytes(reader, &absolute, sizeof absolute));
+    CHECK_STATUS(get_u32(reader, &out->parts));
+    out->first = reader->at;
+    out->length = out->parts ? out->parts - 1 : 0;
+    bool first_is_empty = false;
+    for (uint32_t i = 0; i < out->parts; i++) {
+        wire_text part = {};
+        CHECK_STATUS(find_text(reader, &part));
+        CHECK_STATUS(measure_part(&part, i + 1 < out->parts, extent, &out->length));
+        first_is_empty = i ? first_is_empty : part.length == 0;
+    }
+    const bool begins_with_separator = out->parts > 1 && first_is_empty;
+    out->leading = absolute && !begins_with_separator;
+    out->absolute = absolute || begins_with_separator;
+    out->length += out->leading;
+    out->bare = out->length == (out->absolute ? 1 : 0);
+    CHECK_CONDITION(out->length < ts_size_max);
+    return LC_OK;
+}
+static lc_status write_name(const wire_reader *reader, const wire_name *name, bool escapes, char *out) {
+    wire_reader parts = {reader->buffer, name->first, reader->end};
+    if (name->leading)
+        *out++ = '/';
+    for (uint32_t i = 0; i < name->parts; i++) {
+        wire_text part = {};
+        CHECK_STATUS(find_text(&parts, &part));
+        if (i)
+            *out++ = '/';
+        if (!escapes)
+            memcpy(out, part.bytes, part.length);
+        out += escapes ? write_escaped(&part, i + 1 < name->parts, out) : part.length;
+    }
+    return LC_OK;
+}
+
+// Goes past the attribute.
+static lc_status find_attribute(wire_reader *reader, bn_wire_attrib *out) {
+    const auto offset = static_cast<uint32_t>(reader->at - reader->buffer->buffer);
+    CHECK_STATUS(bn_wire_locate(reader->buffer, offset, 0, out));
+    reader->at += out->used;
+    return LC_OK;
+}
+static lc_status measure_binding(wire_reader *reader, message_extent *extent) {
+    bn_block_size *size = &extent->size;
+    wire_name name = {};
+    uint32_t count = 0;
+    CHECK_STATUS(measure_name(reader, extent, &name));
+    CHECK_STATUS(get_u32(reader, &count));
+    for (uint32_t i = 0; i < count; i++) {
+        bn_wire_attrib found = {};
+        CHECK_STATUS(find_attribute(reader, &found));
+        if (bn_wire_has_text(&found))
+            bn_size_text(size, found.length);
+    }
+    bn_size_binding(size, name.length, name.bare, count);
+    return LC_OK;
+}
+static lc_status place_attribute(wire_reader *reader, bn_block_builder *builder, bn_attrib_array *array) {
+    bn_wire_attrib found = {};
+    CHECK_STATUS(find_attribute(reader, &found));
+    auto *attrib = static_cast<bn_attrib *>(bn_place_record(builder, sizeof(bn_attrib)));
+    CHECK_NULL(attrib);
+    char *text = nullptr;
+    if (bn_wire_has_text(&found)) {
+        text = bn_place_text(builder, found.length);
+        CHECK_NULL(text);
+        memcpy(text, found.value, found.length);
+    }
+    bn_wire_fill(&found, text, attrib);
+    CHECK_STATUS(bn_attrib_array_put_placed(array, found.id, attrib));
+    return LC_OK;
+}
+static lc_status place_binding(wire_reader *reader, message_extent *extent, bn_block_builder *builder,
+                               bn_binding **out) {
+    wire_name name = {};
+    uint32_t count = 0;
+    CHECK_STATUS(measure_name(reader, extent, &name));
+    CHECK_STATUS(get_u32(reader, &count));
+    owned_binding binding;
+    char *text = nullptr;
+    CHECK_STATUS(
+        bn_place_binding(builder, name.length, name.bare, name.absolute, count, &binding.pointer, &text));
+    if (text)
+        CHECK_STATUS(write_name(reader, &name, extent->escapes, text));
+    for (uint32_t i = 0; i < count; i++)
+        CHECK_STATUS(place_attribute(reader, builder, binding.pointer->attributes));
+    *out = binding.take();
+    return LC_OK;
+}
+
+static lc_status skip_subop(wire_reader *reader, bn_block_size *, uint32_t *out_subop) {
+    uint32_t flags = 0;
+    CHECK_STATUS(get_u32(reader, out_subop));
+    CHECK_STATUS(get_u32(reader, &flags));
+    return LC_OK;
+}
+static lc_status measure_query_node(wire_reader *reader, bn_block_size *size) {
+    uint32_t subop = 0;
+    return skip_subop(reader, size, &subop);
+}
+static lc_status measure_set_node(wire_reader *reader, bn_block_size *size) {
+    uint32_t subop = 0;
+    CHECK_STATUS(skip_subop(reader, size, &subop));
+    for (int i = 0; i < 2 && subop == bn_set_reparent; i++) {
+        wire_text text = {};
+        CHECK_STATUS(find_string(reader, &text));
+        bn_size_record(size, sizeof(tstring));
+        bn_size_text(size, text.length);
+    }
+    return LC_OK;
+}
+static lc_status place_query_node(wire_reader *reader, bn_block_builder *, bn_request_node *node) {
+    CHECK_STATUS(get_u32(reader, &node->subop));
+    CHECK_STATUS(get_u32(reader, &node->flags));
+    return LC_OK;
+}
+static lc_status place_string(wire_reader *reader, bn_block_builder *builder, tstring **out) {
+    wire_text text = {};
+    CHECK_STATUS(find_string(reader, &text));
+    CHECK_STATUS(bn_place_string(builder, reinterpret_cast<const char *>(text.bytes), text.length, out));
+    return LC_OK;
+}
+static lc_status place_set_node(wire_reader *reader, bn_block_builder *builder, bn_request_node *node) {
+    CHECK_STATUS(place_query_node(reader, builder, node));
+    if (node->subop != bn_set_reparent)
+        return LC_OK;
+    CHECK_STATUS(place_string(reader, builder, &node->source));
+    CHECK_STATUS(place_string(reader, builder, &node->target));
+    return LC_OK;
+}
+
+// ---- The two kinds of message
+
+namespace {
+// What follows each node, and the nodes; null for nothing.
+template <typename Message, typename Node>
+struct message_trailers {
+    uint16_t msg_type;
+    lc_status (*put_node)(tbuffer *buffer, const Node *node);
+    lc_status (*measure_node)(wire_reader *reader, bn_block_size *size);
+    lc_status (*place_node)(wire_reader *reader, bn_block_builder *builder, Node *node);
+    lc_status (*put_message)(tbuffer *buffer, const Message *msg);
+    lc_status (*get_message)(wire_reader *reader, Message *msg);
+};
+using request_trailers = message_trailers<bn_request_msg, bn_request_node>;
+using response_trailers = message_trailers<bn_response_msg, bn_response_node>;
+} // namespace
+static const request_trailers request_types[] = {
+    {bn_msg_query_request, put_subop, measure_query_node, place_query_node, put_options, get_options},
+    {bn_msg_set_request, put_set_node, measure_set_node, place_set_node, put_options, get_options},
+    {bn_msg_action_request, nullptr, nullptr, nullptr, put_message_name, get_message_name},
+    {bn_msg_event, nullptr, nullptr, nullptr, put_message_name, get_message_name},
+};
+static const response_trailers response_types[] = {
+    {bn_msg_query_response, nullptr, nullptr, nullptr, put_revision, get_revision},
+    {bn_msg_set_response, nullptr, nullptr, nullptr, put_revision, get_revision},
+};
+
+template <typename Trailers, size_t Count>
+static Trailers find_trailers(const Trailers (&types)[Count], uint16_t type) {
+    for (const Trailers &known : types)
+        if (known.msg_type == type)
+            return known;
+    return {};
+}
+
+namespace {
+struct request_kind {
+    using message = bn_request_msg;
+    using node = bn_request_node;
+    using owner = owned_request;
+    using header = bn_wire_request_header;
+    static constexpr auto node_count = bn_request_per_node_array_length_quick;
+    static constexpr auto node_at = bn_request_per_node_array_get_quick;
+    static constexpr auto append = bn_request_per_node_array_append_takeover;
+    // A message of another type is logged and has no trailers; who receives one refuses it by its type, and
+    // the session goes on.
+    static request_trailers trailers_of(uint16_t type) {
+        const request_trailers found = find_trailers(request_types, type);
+        if (!found.msg_type)
+            LC_LOG(LC_LOG_ERR, "illegal messsage of type %d", type);
+        return found;
+    }
+    static constexpr auto new_message = bn_request_msg_new;
+    static constexpr auto new_nodes = bn_request_nodes_new;
+    static void swap(const message *msg, header *out) { bn_byte_swap_request_header(msg, out); }
+    static void swap(const header *wire, message *out) { bn_byte_swap_request_header(wire, out); }
+};
+struct response_kind {
+    using message = bn_response_msg;
+    using node = bn_response_node;
+    using owner = owned_response;
+    using header = bn_wire_response_header;
+    static constexpr auto node_count = bn_response_per_node_array_length_quick;
+    static constexpr auto node_at = bn_response_per_node_array_get_quick;
+    static constexpr auto append = bn_response_per_node_array_append_takeover;
+    static response_trailers trailers_of(uint16_t type) { return find_trailers(response_types, type); }
+    static constexpr auto new_message = bn_response_msg_new;
+    static constexpr auto new_nodes = bn_response_nodes_new;
+    static void swap(const message *msg, header *out) { bn_byte_swap_response_header(msg, out); }
+    static void swap(const header *wire, message *out) { bn_byte_swap_response_header(wire, out); }
+};
+} // namespace
 
 static lc_status start_buffer(uint32_t header_bytes, owned_tbuffer *out) {
     CHECK_STATUS(tb_new(&out->pointer));
@@ -324,134 +534,118 @@ static lc_status start_buffer(uint32_t header_bytes, owned_tbuffer *out) {
     return LC_OK;
 }
 
-lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, tbuffer **out) {
+template <typename Kind>
+static lc_status serialize(typename Kind::message *msg, uint32_t header_bytes, tbuffer **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(msg);
-    const request_trailers *trailers = trailers_of(msg->msg_type);
+    const auto trailers = Kind::trailers_of(msg->msg_type);
     owned_tbuffer buffer;
     CHECK_STATUS(start_buffer(header_bytes, &buffer));
     tbuffer *bytes = buffer.pointer;
-    bn_wire_request_header header = {};
+    typename Kind::header header = {};
     msg->length = 0;
     CHECK_STATUS(tb_append_buf(bytes, &header, sizeof header));
-    CHECK_STATUS(put_string(bytes, msg->audit_user));
+    CHECK_STATUS(put_head(bytes, msg));
     const uint32_t count_at = used(bytes);
     CHECK_STATUS(put_u32(bytes, 0));
     uint32_t written = 0;
-    const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
+    const uint32_t count = Kind::node_count(msg->nodes);
     for (uint32_t i = 0; i < count; i++) {
-        const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
+        const auto *node = Kind::node_at(msg->nodes, i);
         if (!node || !node->binding)
             continue;
         CHECK_STATUS(put_u32(bytes, node->node_id));
         CHECK_STATUS(put_name(bytes, node->binding));
         CHECK_STATUS(put_attributes(bytes, node->binding));
-        CHECK_STATUS(trailers->put_node(bytes, node));
+        if (trailers.put_node)
+            CHECK_STATUS(trailers.put_node(bytes, node));
         written++;
     }
     CHECK_STATUS(put_u32_at(bytes, count_at, written));
-    CHECK_STATUS(trailers->put_message(bytes, msg));
+    if (trailers.put_message)
+        CHECK_STATUS(trailers.put_message(bytes, msg));
     msg->length = used(bytes);
-    bn_byte_swap_request_header(msg, &header);
+    Kind::swap(msg, &header);
     CHECK_STATUS(tb_put_buf(bytes, header_bytes, &header, sizeof header));
     *out = buffer.take();
     return LC_OK;
 }
 
-lc_status bn_request_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
-    CHECK_NULL(out);
-    *out = nullptr;
-    CHECK_NULL(buffer);
-    wire_reader reader = {buffer, offset};
-    bn_wire_request_header header = {};
-    CHECK_STATUS(get_bytes(&reader, &header, sizeof header));
-    const request_trailers *trailers = trailers_of(to_host(header.msg_type));
-    owned_request msg;
-    CHECK_STATUS(bn_request_msg_create(&msg.pointer, to_host(header.msg_type)));
-    bn_byte_swap_request_header(&header, msg.pointer);
-    CHECK_STATUS(get_string(&reader, &msg.pointer->audit_user));
-    uint32_t count = 0;
-    CHECK_STATUS(get_u32(&reader, &count));
-    for (uint32_t i = 0; i < count; i++) {
-        owned_request_node node(static_cast<bn_request_node *>(calloc(1, sizeof(bn_request_node))));
-        CHECK_NULL(node.pointer);
-        node.pointer->msg_type = msg.pointer->msg_type;
-        CHECK_STATUS(get_u32(&reader, &node.pointer->node_id));
-        CHECK_STATUS(get_binding(&reader, &node.pointer->binding));
-        CHECK_STATUS(trailers->get_node(&reader, node.pointer));
-        CHECK_STATUS(bn_request_per_node_array_append_takeover(msg.pointer->nodes, &node.pointer));
-    }
-    CHECK_STATUS(trailers->get_message(&reader, msg.pointer));
-    *out = msg.take();
-    return LC_OK;
-}
-
-// --- Responses
-// ------------------------------------------------------------------------------------------------------
-
-static bool has_revision(uint16_t msg_type) {
-    return msg_type == bn_msg_query_response || msg_type == bn_msg_set_response;
-}
-
-lc_status bn_response_msg_serialize(bn_response_msg *msg, uint32_t header_bytes, tbuffer **out) {
-    CHECK_NULL(out);
-    *out = nullptr;
-    CHECK_NULL(msg);
-    owned_tbuffer buffer;
-    CHECK_STATUS(start_buffer(header_bytes, &buffer));
-    tbuffer *bytes = buffer.pointer;
-    bn_wire_response_header header = {};
-    msg->length = 0;
-    CHECK_STATUS(tb_append_buf(bytes, &header, sizeof header));
-    CHECK_STATUS(put_u32(bytes, msg->return_code));
-    CHECK_STATUS(put_string(bytes, msg->return_message));
-    const uint32_t count_at = used(bytes);
-    CHECK_STATUS(put_u32(bytes, 0));
-    uint32_t written = 0;
-    const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
-    for (uint32_t i = 0; i < count; i++) {
-        const bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
-        if (!node || !node->binding)
-            continue;
-        CHECK_STATUS(put_u32(bytes, node->node_id));
-        CHECK_STATUS(put_name(bytes, node->binding));
-        CHECK_STATUS(put_attributes(bytes, node->binding));
-        written++;
-    }
-    CHECK_STATUS(put_u32_at(bytes, count_at, written));
-    if (has_revision(msg->msg_type))
-        CHECK_STATUS(put_u32(bytes, msg->db_revision_id));
-    msg->length = used(bytes);
-    bn_byte_swap_response_header(msg, &header);
-    CHECK_STATUS(tb_put_buf(bytes, header_bytes, &header, sizeof header));
-    *out = buffer.take();
-    return LC_OK;
-}
-
-lc_status bn_response_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_response_msg **out) {
-    CHECK_NULL(out);
-    *out = nullptr;
-    CHECK_NULL(buffer);
-    wire_reader reader = {buffer, offset};
-    bn_wire_response_header header = {};
-    CHECK_STATUS(get_bytes(&reader, &header, sizeof header));
-    owned_response msg;
-    CHECK_STATUS(bn_response_msg_create(&msg.pointer, to_host(header.msg_type), 0, 0, nullptr));
-    bn_byte_swap_response_header(&header, msg.pointer);
-    CHECK_STATUS(get_u32(&reader, &msg.pointer->return_code));
-    CHECK_STATUS(get_string(&reader, &msg.pointer->return_message));
-    uint32_t count = 0;
-    CHECK_STATUS(get_u32(&reader, &count));
+template <typename Kind, typename Trailers>
+static lc_status measure_nodes(wire_reader *reader, uint32_t count, const Trailers *trailers,
+                               message_extent *extent) {
     for (uint32_t i = 0; i < count; i++) {
         uint32_t node_id = 0;
-        owned_binding binding;
-        CHECK_STATUS(get_u32(&reader, &node_id));
-        CHECK_STATUS(get_binding(&reader, &binding.pointer));
-        CHECK_STATUS(bn_response_msg_append_binding_takeover(msg.pointer, &binding.pointer, node_id));
+        bn_size_record(&extent->size, sizeof(typename Kind::node));
+        CHECK_STATUS(get_u32(reader, &node_id));
+        CHECK_STATUS(measure_binding(reader, extent));
+        if (trailers->measure_node)
+            CHECK_STATUS(trailers->measure_node(reader, &extent->size));
     }
-    if (has_revision(msg.pointer->msg_type))
-        CHECK_STATUS(get_u32(&reader, &msg.pointer->db_revision_id));
+    extent->checked = true;
+    return LC_OK;
+}
+template <typename Kind, typename Trailers>
+static lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers *trailers,
+                             message_extent *extent, typename Kind::message *msg) {
+    bn_block_builder builder = {};
+    CHECK_STATUS(bn_block_new(&extent->size, &builder));
+    msg->block = builder.block;
+    for (uint32_t i = 0; i < count; i++) {
+        auto *node =
+            static_cast<typename Kind::node *>(bn_place_record(&builder, sizeof(typename Kind::node)));
+        CHECK_NULL(node);
+        node->placed = true;
+        node->msg_type = msg->msg_type;
+        CHECK_STATUS(get_u32(reader, &node->node_id));
+        CHECK_STATUS(place_binding(reader, extent, &builder, &node->binding));
+        CHECK_STATUS(Kind::append(msg->nodes, &node));
+        if (trailers->place_node)
+            CHECK_STATUS(trailers->place_node(reader, &builder, Kind::node_at(msg->nodes, i)));
+    }
+    return LC_OK;
+}
+
+// Nothing is taken for the nodes before all of them have been found good: a count that the bytes don't bear
+// out costs nothing.
+template <typename Kind>
+static lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Kind::message **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(buffer);
+    CHECK_CONDITION(offset <= buffer->length);
+    wire_reader reader = {buffer, buffer->buffer + offset, buffer->buffer + buffer->length};
+    typename Kind::header header = {};
+    CHECK_STATUS(get_bytes(&reader, &header, sizeof header));
+    typename Kind::owner msg;
+    CHECK_STATUS(Kind::new_message(&msg.pointer, to_host(header.msg_type)));
+    Kind::swap(&header, msg.pointer);
+    const auto trailers = Kind::trailers_of(msg.pointer->msg_type);
+    CHECK_STATUS(get_head(&reader, msg.pointer));
+    uint32_t count = 0;
+    message_extent extent = {};
+    CHECK_STATUS(get_u32(&reader, &count));
+    wire_reader nodes = reader;
+    CHECK_STATUS(measure_nodes<Kind>(&reader, count, &trailers, &extent));
+    if (trailers.get_message)
+        CHECK_STATUS(trailers.get_message(&reader, msg.pointer));
+    CHECK_STATUS(Kind::new_nodes(&msg.pointer->nodes, count));
+    if (count)
+        CHECK_STATUS(place_nodes<Kind>(&nodes, count, &trailers, &extent, msg.pointer));
     *out = msg.take();
     return LC_OK;
+}
+
+lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, tbuffer **out) {
+    return serialize<request_kind>(msg, header_bytes, out);
+}
+lc_status bn_response_msg_serialize(bn_response_msg *msg, uint32_t header_bytes, tbuffer **out) {
+    return serialize<response_kind>(msg, header_bytes, out);
+}
+lc_status bn_request_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
+    return deserialize<request_kind>(buffer, offset, out);
+}
+lc_status bn_response_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_response_msg **out) {
+    return deserialize<response_kind>(buffer, offset, out);
 }

@@ -2,11 +2,23 @@
 #pragma once
 
 #include <cstdint>
+#include <type_traits>
 
 #include "mgmt/bnode_types.h"
 
 // How the bytes of a value are to be read.
 enum class value_shape : uint8_t { none, natural, integer, real, bytes, ipaddr, ipprefix, text, binary };
+
+// The families of the wire form. A value in place has its size before it, or `leading` bytes of its record
+// and then an address; a text or binary its length.
+struct bn_wire_family {
+    uint32_t kind;
+    uint32_t leading;
+};
+enum : uint32_t { wire_kind_number = 1, wire_kind_stored = 2, wire_kind_counted = 4 };
+inline constexpr bn_wire_family wire_number = {wire_kind_number, 0}, wire_bytes = {wire_kind_stored, 0},
+                                wire_ipaddr = {wire_kind_number, 1}, wire_ipprefix = {wire_kind_number, 2},
+                                wire_counted = {wire_kind_counted, 0};
 
 struct bn_type_row;
 // To text: a heap text. From text: into an attribute whose value is zero; LC_BAD_TYPE without a line.
@@ -21,9 +33,8 @@ struct bn_type_row {
     bool numeric;
     bn_text_out text_out;
     bn_text_in text_in;
-    decltype(bn_attrib_copy_func::write) write;
-    decltype(bn_attrib_copy_func::read) read;
-    const void *form; // what a text function needs beside the type
+    const bn_wire_family *wire; // null: none
+    const void *form;           // what a text function needs beside the type
 };
 
 // Null for a number that is no type.
@@ -42,12 +53,26 @@ lc_status bn_text_to_integer(const char *text, int64_t least, int64_t most, int6
 lc_status bn_text_to_ipaddr(const char *text, lc_ipaddr *out);
 lc_status bn_text_to_ipprefix(const char *text, lc_ipprefix *out);
 
-// The families of the wire form.
-using bn_wire_writer = lc_status(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                                 uint32_t *out_written);
-using bn_wire_reader = lc_status(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
-                                 uint32_t *out_used);
-bn_wire_writer bn_wire_write_number, bn_wire_write_bytes, bn_wire_write_ipaddr, bn_wire_write_ipprefix,
-    bn_wire_write_text, bn_wire_write_binary;
-bn_wire_reader bn_wire_read_number, bn_wire_read_bytes, bn_wire_read_ipaddr, bn_wire_read_ipprefix,
-    bn_wire_read_text, bn_wire_read_binary;
+// ---- On the wire
+
+std::remove_pointer_t<decltype(bn_attrib_copy_func::write)> bn_wire_write;
+std::remove_pointer_t<decltype(bn_attrib_copy_func::read)> bn_wire_read;
+
+// An attribute that was found well formed in the buffer.
+struct bn_wire_attrib {
+    const bn_type_row *row;
+    uint32_t id, flags;
+    const uint8_t *value; // in the buffer
+    uint32_t length;      // of the value
+    uint32_t used;        // of the whole
+};
+// LC_ASSERTION with a line for a NUL among the bytes, since what follows it would be lost.
+lc_status bn_check_text(const uint8_t *bytes, uint32_t length);
+// Type 0 takes the one that the bytes have. Nothing is allocated.
+lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_wire_attrib *out);
+// Whether it becomes a text or bytes beside the attribute.
+bool bn_wire_has_text(const bn_wire_attrib *found);
+// Fills a new attribute. `text` is a copy of the value with a NUL behind it, for one that has a text.
+void bn_wire_fill(const bn_wire_attrib *found, char *text, bn_attrib *out);
+// The value of a text or binary, in memory that outlives the attribute: `length` bytes and a NUL.
+void bn_attrib_place_value(bn_attrib *attrib, char *text, uint32_t length);

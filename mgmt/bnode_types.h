@@ -140,14 +140,24 @@ struct bn_attrib {
         alignas(8) uint8_t bytes[32];
         tstring *string; // owned
         tbuffer *binary; // owned
+        // The record behind its pointer, for a text or bytes that lie in a block (bnode_block.h).
+        struct {
+            tstring *string;
+            tstring record;
+        } placed_string;
+        struct {
+            tbuffer *binary;
+            tbuffer record;
+        } placed_binary;
     } value;
 };
+static_assert(sizeof(bn_attrib) == 48);
 struct bn_binding;
 
-// The wire form of an attribute; one row for each type. A type without one has null functions.
+// The wire form of an attribute; one row for each type. A type without one has null functions. `read` makes
+// an attribute of the type that the row was chosen by.
 struct bn_attrib_copy_func {
     lc_status (*write)(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t *out_written);
-    // `type` is what the row was chosen by. Takes no more memory than there are bytes behind `offset`.
     lc_status (*read)(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
                       uint32_t *out_used);
 };

@@ -463,8 +463,8 @@ TEST(Bindings, Patterns) {
     for (const auto &c : pattern_cases)
         EXPECT_EQ(bn_binding_name_pattern_match(c.name, c.pattern), c.matched) << c.pattern << " " << c.name;
 }
-// Every short pattern against every short name: the walk over the text and the one over parts agree, and so
-// do a message's bytes of a name from either.
+// Every short pattern against every short name: the walk over the text and the one over parts agree, so do a
+// message's bytes of a name from either, and reading them joins the parts as everybody does.
 TEST(Bindings, BothMatchersAgreeEverywhere) {
     static const char *pieces[] = {"a", "*", "**", "\\/", "\\\\", "", "ab"};
     std::vector<std::string> names = {"", "/"};
@@ -492,6 +492,11 @@ TEST(Bindings, BothMatchersAgreeEverywhere) {
             ASSERT_EQ(bn_event_request_msg_append_binding_takeover(msg, 0, &binding.pointer, nullptr), LC_OK);
             ASSERT_EQ(bn_request_msg_serialize(msg, 0, &buffer), LC_OK);
             bytes[from_parts] = content(buffer);
+            owner<bn_request_msg, bn_request_msg_free> read;
+            ASSERT_EQ(bn_request_msg_deserialize(buffer, 0, &read), LC_OK);
+            EXPECT_EQ(
+                text_of([&](char **out) { return bn_binding_name_parts_to_name(parts, absolute, out); }),
+                bn_binding_get_name_quick(bn_request_per_node_array_get_quick(read->nodes, 0)->binding));
         }
         EXPECT_EQ(bytes[0], bytes[1]) << name;
         for (const std::string &pattern : names)

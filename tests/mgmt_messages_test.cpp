@@ -1,5 +1,6 @@
 // Messages by their bytes, what a reader refuses, and the way of a message over a session into its callback.
 #include <gtest/gtest.h>
+#include <malloc.h>
 
 #include <string>
 
@@ -150,6 +151,7 @@ TEST(messages, attributes_asked_for) {
     }
 }
 
+// Messages that were made here and messages that were received read alike.
 TEST(messages, response_bytes_and_reading) {
     response_owner msg, copy;
     ASSERT_EQ(bn_query_response_msg_create(&msg, 41, 3, "no"), 0);
@@ -158,28 +160,37 @@ TEST(messages, response_bytes_and_reading) {
     ASSERT_EQ(bn_binding_new_str(&binding, "/n", bn_attrib_value, bn_type_str, 0, "v"), 0);
     ASSERT_EQ(bn_binding_name_to_parts("/n", &binding.pointer->parts, nullptr), 0);
     ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg, &binding.pointer, 1004), 0);
-    expect_response(msg, 2,
-                    u32(3) + str("no") + u32(1) + u32(1004) + u8(1) + u32(1) + str("n") + u32(1) +
-                        text_attribute(1, bn_type_str, "v") + u32(99));
+    const wire bytes = u32(3) + str("no") + u32(1) + u32(1004) + u8(1) + u32(1) + str("n") + u32(1) +
+                       text_attribute(1, bn_type_str, "v") + u32(99);
+    expect_response(msg, 2, bytes);
     ASSERT_EQ(bn_response_msg_dup(msg, &copy), 0);
-    for (int round = 0; round < 3; round++) { // by copy, by takeover, from what that left
-        uint32_t code = 0;
-        string_owner message;
-        bindings_owner bindings;
-        ids_owner ids;
-        ASSERT_EQ(round == 0 ? bn_response_get(msg, &code, &message, 1, &bindings, &ids)
-                             : bn_response_get_takeover(msg, &code, &message, 0, &bindings, &ids),
-                  0);
-        EXPECT_EQ(code, 3u);
-        EXPECT_STREQ(ts_str(message), "no");
-        ASSERT_EQ(bn_binding_array_length_quick(bindings), round < 2 ? 1u : 0u);
-        if (round == 2)
-            continue;
-        const bn_binding *got = bn_binding_array_get_quick(bindings, 0);
-        EXPECT_STREQ(bn_binding_get_name_quick(got), "/n");
-        EXPECT_EQ(got->parts != nullptr, round == 0);
-        EXPECT_EQ(uint32_array_get_quick(ids, 0), 1004u);
-    }
+    for (const bool received : {false, true})
+        for (const int keep : {0, 1}) {
+            response_owner from;
+            ASSERT_EQ(bn_response_msg_dup(msg, &from), 0);
+            if (received) {
+                ASSERT_EQ(read(bn_response_msg_deserialize, room + response(2, bytes), &from), 0);
+            }
+            for (int round = 0; round < 3; round++) { // by copy, by takeover, from what that left
+                uint32_t code = 0;
+                string_owner message;
+                bindings_owner bindings;
+                ids_owner ids;
+                ASSERT_EQ(round == 0 ? bn_response_get(from, &code, &message, keep, &bindings, &ids)
+                                     : bn_response_get_takeover(from, &code, &message, keep, &bindings, &ids),
+                          0);
+                EXPECT_EQ(code, 3u);
+                EXPECT_STREQ(ts_str(message), "no");
+                ASSERT_EQ(bn_binding_array_length_quick(bindings), round < 2 ? 1u : 0u);
+                if (round == 2)
+                    continue;
+                const bn_binding *got = bn_binding_array_get_quick(bindings, 0);
+                EXPECT_STREQ(bn_binding_get_name_quick(got), "/n");
+                ASSERT_EQ(got->parts != nullptr, keep != 0) << received << round;
+                EXPECT_STREQ(keep ? tstr_array_get_str_quick(got->parts, 0) : "n", "n");
+                EXPECT_EQ(uint32_array_get_quick(ids, 0), 1004u);
+            }
+        }
     EXPECT_NE(bn_response_per_node_array_get_quick(copy->nodes, 0)->binding, nullptr);
 
     for (const uint16_t type : {bn_msg_set_response, bn_msg_action_response, bn_msg_event_ack}) {
@@ -209,6 +220,176 @@ TEST(messages, lies_are_refused) {
         EXPECT_NE(read_request(body + wire(8, '\0'), &msg), 0);
         EXPECT_EQ(msg.pointer, nullptr);
     }
+}
+
+// In each place of a message that takes a text; bytes may be any.
+TEST(messages, a_nul_in_a_text_is_refused) {
+    const wire start = u32(1) + u32(1000) + u8(1), bare = u32(0) + u32(0),
+               trailer = u32(0) + str("") + u32(0);
+    gcl_log log;
+    for (const wire &text : {wire("a?b"), wire("a\0b", 3)}) {
+        const wire value = start + u32(1) + str("n") + u32(1);
+        const wire requests[] = {
+            request(7, str(text) + u32(0) + str("e")),
+            request(7, str("") + u32(0) + str(text)),
+            request(7, str("") + start + u32(2) + str(text) + str("c") + u32(0) + str("e")),
+            request(7, str("") + value + text_attribute(1, bn_type_str, text) + str("e")),
+            request(7, str("") + value + text_attribute(1, bn_type_uri, text) + str("e")),
+            request(3,
+                    str("") + start + bare + u32(bn_set_reparent) + u32(0) + str(text) + str("") + trailer),
+            request(3,
+                    str("") + start + bare + u32(bn_set_reparent) + u32(0) + str("") + str(text) + trailer),
+        };
+        const bool refused = text[1] == 0;
+        for (const wire &bytes : requests) {
+            request_owner msg;
+            EXPECT_EQ(read_request(room + bytes, &msg), refused ? LC_ASSERTION : LC_OK)
+                << (&bytes - requests);
+        }
+        request_owner binary;
+        response_owner answer;
+        ASSERT_EQ(read_request(
+                      room + request(7, str("") + value + text_attribute(1, bn_type_binary, text) + str("e")),
+                      &binary),
+                  0);
+        const bn_request_node *node = bn_request_per_node_array_get_quick(binary->nodes, 0);
+        EXPECT_EQ(bytes_of(bn_attrib_array_get_quick(node->binding->attributes, 1)->value.binary), text);
+        EXPECT_EQ(read(bn_response_msg_deserialize, room + response(6, u32(0) + str(text) + u32(0)), &answer),
+                  refused ? LC_ASSERTION : LC_OK);
+        EXPECT_EQ(log.count("Received string of 3 bytes has a NUL at 1"), refused ? 8 : 0);
+    }
+}
+
+// ---- Memory
+
+static size_t allocated() {
+    const struct mallinfo2 info = mallinfo2();
+    return info.uordblks + info.hblkhd;
+}
+// A received message, and each copy of its bindings, takes at most eight times its bytes, whatever a peer
+// puts in it; the parts of the names, for those who ask for them, at most nine.
+TEST(messages, received_messages_are_bounded) {
+    const wire name = u8(1) + u32(1) + str("n"),
+               none = u32(1) + u32(130) + u32(bn_type_none) + u32(0) + u32(0);
+    const auto times = [](size_t count, const wire &piece) {
+        wire all;
+        while (count--)
+            all += piece;
+        return all;
+    };
+    const struct {
+        const char *what;
+        uint32_t nodes;
+        wire node; // from its name on
+    } shapes[] = {
+        {"nothing", 4000, u8(0) + u32(0) + u32(0)},
+        {"no parts, absolute", 4000, u8(1) + u32(0) + u32(0)},
+        {"name of one character", 4000, name + u32(0)},
+        {"a part of one slash", 4000, u8(0) + u32(1) + str("/") + u32(0)},
+        {"two empty parts", 4000, u8(0) + u32(2) + str("") + str("") + u32(0)},
+        {"three empty parts", 4000, u8(0) + u32(3) + str("") + str("") + str("") + u32(0)},
+        {"last attribute, no value", 2000, u8(0) + u32(0) + u32(1) + none},
+        {"empty text", 2000, name + u32(1) + text_attribute(1, bn_type_str, "")},
+        {"empty bytes", 2000, name + u32(1) + text_attribute(1, bn_type_binary, "")},
+        {"one attribute again and again", 1, name + u32(2000) + times(2000, none)},
+        {"empty parts", 1, u8(1) + u32(20000) + times(20000, str("")) + u32(0)},
+        {"slashes", 1, u8(1) + u32(1) + str(wire(50000, '/')) + u32(0)},
+        {"an ordinary node", 500,
+         u8(1) + u32(4) + str("qv") + str("wccpd") + str("config") + str("51") + u32(1) +
+             text_attribute(1, bn_type_str, "value")},
+    };
+    for (const auto &shape : shapes)
+        for (const uint32_t type : {7u, 3u, 1u, 2u}) {
+            const wire node = u32(1000) + shape.node + (type % 2 && type < 5 ? u32(1) + u32(0) : wire());
+            const wire nodes = u32(shape.nodes) + times(shape.nodes, node);
+            const wire options = u32(0) + str("") + u32(0);
+            const wire bytes =
+                room + (type == 2 ? response(type, u32(0) + str("") + nodes + u32(0))
+                                  : request(type, str("") + nodes + (type == 7 ? str("e") : options)));
+            SCOPED_TRACE(std::string(shape.what) + " in " + std::to_string(type));
+            buffer_owner buffer;
+            request_owner asked;
+            response_owner answered, copy;
+            bindings_owner bindings, with_parts;
+            ids_owner ids;
+            bn_node_info *info = nullptr;
+            ASSERT_EQ(tb_new_buf(&buffer, bytes.data(), static_cast<int32_t>(bytes.size())), 0);
+            size_t taken[4] = {allocated()};
+            if (type == 2) {
+                ASSERT_EQ(bn_response_msg_deserialize(buffer, 32, &answered), 0);
+                taken[1] = allocated();
+                ASSERT_EQ(bn_response_msg_dup(answered, &copy), 0);
+                taken[2] = allocated();
+                ASSERT_EQ(bn_response_get_takeover(answered, nullptr, nullptr, 1, &with_parts, nullptr), 0);
+            } else {
+                ASSERT_EQ(bn_request_msg_deserialize(buffer, 32, &asked), 0);
+                taken[1] = allocated();
+                ASSERT_EQ(bn_request_get(asked, nullptr, nullptr, 0, &bindings, &ids, &info), 0);
+                taken[2] = allocated();
+                ASSERT_EQ(bn_request_get(asked, nullptr, nullptr, 1, &with_parts, nullptr, nullptr), 0);
+            }
+            taken[3] = allocated();
+            free(info);
+            const size_t overhead = 2048, message = bytes.size() - 32;
+            EXPECT_LE(taken[1] - taken[0], 8 * message + overhead);
+            EXPECT_LE(taken[2] - taken[1], 8 * message + overhead);
+            EXPECT_LE(taken[3] - taken[2], (type == 2 ? 10 : 17) * message + overhead);
+        }
+}
+
+// A binding that came with a message outlives it, may be changed and copied, and gives away what it has.
+TEST(messages, received_bindings_are_their_takers) {
+    const wire node = u32(1000) + u8(1) + u32(1) + str("n") + u32(3) + text_attribute(1, bn_type_str, "v") +
+                      text_attribute(65, bn_type_binary, "b") + u32(1) + u32(129) + u32(bn_type_uint32) +
+                      u32(0) + u32(4) + u32(7);
+    const wire bare = u32(1000) + u8(1) + u32(0) + u32(0);
+    response_owner msg;
+    bindings_owner bindings;
+    ASSERT_EQ(read(bn_response_msg_deserialize,
+                   room + response(2, u32(0) + str("") + u32(5) + node + node + node + bare + bare + u32(0)),
+                   &msg),
+              0);
+    ASSERT_EQ(bn_response_get_takeover(msg, nullptr, nullptr, 0, &bindings, nullptr), 0);
+    const auto value_of = [](const bn_binding *binding) {
+        return text_of([&](char **out) { return bn_binding_get_str(binding, 1, 0, nullptr, out); });
+    };
+    binding_owner kept, changed, emptied, first, second;
+    for (bn_binding **out :
+         {&kept.pointer, &changed.pointer, &emptied.pointer, &first.pointer, &second.pointer})
+        ASSERT_EQ(bn_binding_array_remove(bindings, 0, out), 0);
+    msg.reset();
+    bindings.reset();
+
+    binding_owner copy, given;
+    ASSERT_EQ(bn_binding_set_name(changed, "/other"), 0);
+    ASSERT_EQ(bn_binding_set_str(changed, 1, bn_type_str, 0, "w"), 0);
+    ASSERT_EQ(bn_binding_set_uint32(changed, 2, 0, 9), 0);
+    ASSERT_EQ(bn_attrib_set_str(bn_attrib_array_get_quick(changed->attributes, 65), 65, bn_type_str, 0, "x"),
+              0);
+    ASSERT_EQ(bn_binding_dup(changed, &copy), 0);
+    changed.reset();
+    EXPECT_EQ(value_of(copy), "w");
+    EXPECT_EQ(bn_attrib_array_length_quick(copy->attributes), 130u);
+    EXPECT_STREQ(ts_str(bn_attrib_array_get_quick(copy->attributes, 65)->value.string), "x");
+    EXPECT_STREQ(bn_binding_get_name_quick(copy), "/other");
+
+    ASSERT_EQ(
+        bn_binding_new_parts_components_takeover(&given, &emptied->name, nullptr, 1, &emptied->attributes),
+        0);
+    emptied.reset();
+    EXPECT_STREQ(bn_binding_get_name_quick(given), "/n");
+    EXPECT_EQ(value_of(given), "v");
+
+    ASSERT_EQ(bn_binding_set_name(first, "/renamed"), 0);
+    EXPECT_STREQ(bn_binding_get_name_quick(second), "/");
+
+    request_owner forwarded;
+    ASSERT_EQ(bn_event_request_msg_create(&forwarded, "/e"), 0);
+    ASSERT_EQ(bn_event_request_msg_append_binding_takeover(forwarded, 0, &kept.pointer, nullptr), 0);
+    number(forwarded.pointer);
+    buffer_owner written;
+    ASSERT_EQ(bn_request_msg_serialize(forwarded, 32, &written), 0);
+    EXPECT_EQ(bytes_of(written), room + request(7, str("") + u32(1) + node + str("/e")));
 }
 
 TEST(messages, odd_messages_are_read) {

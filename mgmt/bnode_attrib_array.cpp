@@ -1,0 +1,141 @@
+// The attributes of a node. To its users this is an array whose index is the attribute id; only the slots
+// that are filled take memory, since a peer chooses the ids and most nodes have their value and nothing else.
+#include <algorithm>
+#include <cstdlib>
+#include <cstring>
+
+#include "mgmt/bnode.h"
+#include "mgmt/bnode_block.h"
+#include "runtime/guards.h"
+
+// The first filled slot at or above `id`.
+static uint32_t place_of(const bn_attrib_array *array, uint32_t id) {
+    uint32_t at = 0;
+    while (at < array->count && array->slots[at].id < id)
+        at++;
+    return at;
+}
+static bn_attrib *attrib_at(const bn_attrib_array *array, uint32_t id) {
+    const uint32_t at = place_of(array, id);
+    return at < array->count && array->slots[at].id == id ? array->slots[at].attrib : nullptr;
+}
+static void free_slot(bn_attrib_slot *slot) {
+    if (slot->placed)
+        (void)bn_attrib_free_value(slot->attrib);
+    else
+        (void)bn_attrib_free(&slot->attrib);
+}
+
+lc_status bn_attrib_array_new_full(bn_attrib_array **out, const array_options *) {
+    CHECK_NULL(out);
+    *out = static_cast<bn_attrib_array *>(calloc(1, sizeof(bn_attrib_array)));
+    CHECK_NULL(*out);
+    return LC_OK;
+}
+lc_status bn_attrib_array_new(bn_attrib_array **out) {
+    return bn_attrib_array_new_full(out, nullptr);
+}
+lc_status bn_attrib_array_free(bn_attrib_array **inout) {
+    CHECK_NULL(inout);
+    bn_attrib_array *array = *inout;
+    *inout = nullptr;
+    if (!array)
+        return LC_OK;
+    for (uint32_t i = 0; i < array->count; i++)
+        free_slot(&array->slots[i]);
+    if (!array->placed_slots)
+        free(array->slots);
+    if (!array->placed_record)
+        free(array);
+    return LC_OK;
+}
+void bn_attrib_array_release(bn_attrib_array *array) {
+    (void)bn_attrib_array_free(&array);
+}
+
+static lc_status make_room(bn_attrib_array *array, uint32_t count) {
+    if (count <= array->capacity)
+        return LC_OK;
+    const uint32_t capacity = std::max(count, array->capacity * 2);
+    auto *slots = static_cast<bn_attrib_slot *>(
+        realloc(array->placed_slots ? nullptr : array->slots, capacity * sizeof(bn_attrib_slot)));
+    CHECK_NULL(slots);
+    if (array->placed_slots)
+        memcpy(slots, array->slots, array->count * sizeof(bn_attrib_slot));
+    array->placed_slots = 0;
+    array->slots = slots;
+    array->capacity = capacity;
+    return LC_OK;
+}
+lc_status bn_attrib_array_duplicate(const bn_attrib_array *array, bn_attrib_array **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(array);
+    owned<bn_attrib_array, bn_attrib_array_release> copy;
+    CHECK_STATUS(bn_attrib_array_new(&copy.pointer));
+    CHECK_STATUS(make_room(copy.pointer, array->count));
+    for (uint32_t i = 0; i < array->count; i++) {
+        bn_attrib *attrib = nullptr;
+        CHECK_STATUS(bn_attrib_dup(array->slots[i].attrib, &attrib));
+        copy.pointer->slots[copy.pointer->count++] = {array->slots[i].id, false, attrib};
+    }
+    copy.pointer->length = array->length;
+    *out = copy.take();
+    return LC_OK;
+}
+
+uint32_t bn_attrib_array_length_quick(const bn_attrib_array *array) {
+    return array ? array->length : 0;
+}
+bn_attrib *bn_attrib_array_get_quick(const bn_attrib_array *array, uint32_t id) {
+    return array ? attrib_at(array, id) : nullptr;
+}
+lc_status bn_attrib_array_get(const bn_attrib_array *array, uint32_t id, bn_attrib **out) {
+    CHECK_NULL(out);
+    *out = nullptr;
+    CHECK_NULL(array);
+    if (id >= array->length)
+        return LC_NOT_FOUND;
+    *out = attrib_at(array, id);
+    return LC_OK;
+}
+
+static lc_status put(bn_attrib_array *array, uint32_t id, bn_attrib *attrib, bool placed) {
+    CHECK_CONDITION(id <= array_size_max);
+    const uint32_t at = place_of(array, id);
+    const bool filled = at < array->count && array->slots[at].id == id;
+    bn_attrib_slot *end = array->slots + array->count;
+    if (filled && array->slots[at].attrib == attrib)
+        return LC_OK;
+    if (filled)
+        free_slot(&array->slots[at]);
+    if (filled && !attrib) {
+        std::copy(array->slots + at + 1, end, array->slots + at);
+        array->count--;
+    } else if (attrib && !filled) {
+        CHECK_STATUS(make_room(array, array->count + 1));
+        end = array->slots + array->count++;
+        std::copy_backward(array->slots + at, end, end + 1);
+    }
+    if (attrib)
+        array->slots[at] = {id, placed, attrib};
+    array->length = std::max(array->length, id + 1);
+    return LC_OK;
+}
+lc_status bn_attrib_array_set_takeover(bn_attrib_array *array, uint32_t id, bn_attrib **inout) {
+    CHECK_NULL(array);
+    CHECK_NULL(inout);
+    CHECK_QUIET(put(array, id, *inout, false));
+    *inout = nullptr;
+    return LC_OK;
+}
+lc_status bn_attrib_array_set(bn_attrib_array *array, uint32_t id, const bn_attrib *attrib) {
+    CHECK_NULL(array);
+    owned<bn_attrib, bn_release_attrib> copy;
+    if (attrib)
+        CHECK_STATUS(bn_attrib_dup(attrib, &copy.pointer));
+    return bn_attrib_array_set_takeover(array, id, &copy.pointer);
+}
+lc_status bn_attrib_array_put_placed(bn_attrib_array *array, uint32_t id, bn_attrib *attrib) {
+    return put(array, id, attrib, true);
+}
