@@ -3,16 +3,16 @@
 // One record for each pair of this appliance's address and a router's id; service groups that share the pair
 // share the tunnel and are counted in `ref_count`. The table hands out tunnel ids from a range of 32, one for
 // each bit of a bitmap: a clear bit means that a record holds the id or that an add for it is under way.
-// What tunneld is told goes through the mailbox (wccpd_common.cpp), which waits for the answer.
+// Commands to tunneld go through the mailbox (wccpd_common.cpp), which waits for the answer.
 //
-// The tunnel mutex covers the list and the bitmap. It stands behind the engine lock and before the mailbox's
-// own. An add lets go of it while it waits for tunneld; a delete and a restore hold it through the wait. Two
+// The tunnel mutex covers the list and the bitmap. It is taken after the engine lock and before the mailbox's
+// own. An add releases it while it waits for tunneld; a delete and a restore hold it through the wait. Two
 // adds for one new key are kept apart by the engine lock, which every caller of wccp_add_tunnel holds.
 //
-// A caller can be cancelled in each of these waits. An add that ends so gives back its id and its record; a
-// delete still takes its record out of the table, as after a delete that failed, and nobody is left with the
-// mutex. From the moment when a new record is in the table until wccp_add_tunnel has returned there is no
-// cancellation, so a caller that notes its reference first thing never loses one.
+// A caller can be cancelled in each of these waits. An add that is cancelled gives back its id and frees its
+// record; a delete still takes its record out of the table, as after a delete that failed; and the mutex is
+// released. From the moment a new record is in the table until wccp_add_tunnel has returned there is no
+// cancellation: a caller that notes its reference at once never loses one.
 
 #include "engine/wccp_tunnel.h"
 
@@ -158,8 +158,8 @@ int wccp_del_tunnel(uint32_t group_id, be32 local, be32 remote, int force) {
     return 1;
 }
 
-// The mutex is free between two deletes, so the walk goes by the head of the list: each delete takes that
-// record out, and no pointer is kept that another thread could free meanwhile.
+// The mutex is free between two deletes. Therefore the walk goes by the head of the list: each delete takes
+// that record out, and no pointer is kept that another thread could free meanwhile.
 int wccp_del_all_tunnels() {
     for (;;) {
         be32 local, remote;

@@ -1,13 +1,13 @@
 // wccpd's side of the mailbox to tunneld.
 //
-// Only the process that created the block writes to it. A second wccpd, whose creation was refused, knows no
+// Only the process that created the block writes to it. A second wccpd, whose creation was refused, has no
 // mailbox: its commands fail at once, it publishes no role, and its exit resets nothing.
 //
-// One mutex, behind every other lock of the engine and before none, keeps commands apart: it is held from the
-// first input to the end of the wait. Therefore two commands never overlap, whichever of the engine's locks
-// their callers hold. `command` is set to 0 before an input is touched, because a delete or an L2 return that
-// timed out is still pending and tunneld may be reading it; it is written last, with release order, and the
-// answer is looked for with acquire order.
+// One mutex, the last in the engine's order of locks, keeps commands apart: it is held from the first input
+// to the end of the wait. Therefore two commands never overlap, whichever of the engine's locks their callers
+// hold. `command` is set to 0 before an input is touched, because a delete or an L2 return that timed out is
+// still pending and tunneld may be reading it; it is written last, with release order, and the answer is
+// looked for with acquire order.
 //
 // The wait is a poll of one millisecond, two thousand times. Between two polls, when there is no answer yet,
 // it is a cancellation point: an answer that has come is taken, and a thread that is cancelled before

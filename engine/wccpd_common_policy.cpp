@@ -1,10 +1,10 @@
 // The policy groups: which service groups belong to each, and the role that this gives it.
 //
-// One small mutex, behind every other lock of the engine, keeps the management thread, which changes
-// memberships, from the engine's threads, which change roles. A table of 65536 bit sets would be 2 MB of
-// locked memory for what is at most a few hundred memberships. Therefore `policy_grp_members` holds only the
-// sets that are not empty, in no order, and grows when it needs one more. When it cannot grow, the membership
-// is refused, the caller is informed, and the table stays as it was.
+// One small mutex, the last in the engine's order of locks, keeps the management thread, which changes
+// memberships, apart from the engine's threads, which change roles. A table of 65536 bit sets would be 2 MB
+// of locked memory for what is at most a few hundred memberships. Therefore `policy_grp_members` holds only
+// the sets that are not empty, in no order, and grows when it needs one more. When it cannot grow, the
+// membership is refused, the caller is informed, and the table stays as it was.
 
 #include "engine/wccpd_common.h"
 

@@ -1,8 +1,8 @@
 // The mailbox as tunneld uses it, and the attaching that both sides share.
 //
 // Nothing here takes a lock: tunneld has one thread for its commands, and a role is one load. Every field is
-// read and written as one access of its own width with acquire and release order, so that neither the
-// compiler nor the machine moves an input across the `command` that hands it over.
+// read and written in one access of its own width with acquire and release order; neither the compiler nor
+// the machine moves an input across the `command` that hands it over.
 //
 // wccpd gives up a command after about two seconds and may then replace it while tunneld is still reading.
 // Therefore the inputs are read twice, with `command` checked before, between and after: wccpd sets `command`

@@ -195,7 +195,7 @@ static bool load_conf(cmem_registry *fresh) {
 
 // --- The registry
 
-// Bytes that can be used behind a segment: its last page is there as a whole. 0 when it cannot be told.
+// The bytes of a segment that can be used: its last page is there as a whole. 0 when it cannot be asked.
 static uint64_t segment_bytes(int id) {
     shmid_ds status = {};
     return shmctl(id, IPC_STAT, &status) == 0 ? round_up(status.shm_segsz, NORMAL_PAGE) : 0;

@@ -122,7 +122,7 @@ TEST(SecondWccpd, TouchesNothingOfTheFirst) {
 }
 
 #ifndef WCCP_SANITIZED
-// Before any thread has run: the room that one leaves behind would do for the table.
+// Before any thread has run: the memory that one leaves free would do for the table.
 TEST_F(Mailbox, WithoutMemoryAMembershipIsRefusedAndTheRestStays) {
     const uint8_t id = 9;
     rlimit before;

@@ -234,7 +234,7 @@ TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
         EXPECT_EQ(cmem_exists_block("block"), 0); // its record is free again
         EXPECT_EQ(create(UINT64_MAX, "block"), nullptr);
         EXPECT_TRUE(told("cannot attach/shmget shared block block"));
-        // Behind a block that stands in the registry a shorter one has appeared.
+        // The segment of a block in the registry has been replaced by a shorter one.
         ASSERT_NE(create(BLOCK_BYTES, "other"), nullptr);
         ASSERT_EQ(shmctl(shmget(0x12346, 0, 0), IPC_RMID, nullptr), 0);
         EXPECT_EQ(cmem_exists_block("other"), 0);

@@ -126,7 +126,7 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
         const tunneld_options *options; // of a daemon that starts here
         uint16_t code, id;
         uint32_t remote, status, index; // index: what the mailbox holds then
-        std::string said;               // of a tunnel behind what it is
+        std::string said;               // of a tunnel, after what it is
     } steps[] = {
         {&does, ADD, 300, 2, 0, 7, "done"},
         {nullptr, ADD, 301, 3, 0, 8, "done"},
@@ -142,7 +142,7 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
         {&refuses, ADD, 306, 2, 1, NONE, "refused"},
         {&without_index, ADD, 306, 2, 0, NONE, "done, without an index"},
         {&is_silent, ADD, 306, 2, 77, NONE, "not answered"},
-        {nullptr, ADD, 306, 2, 77, NONE, ""}, // told once
+        {nullptr, ADD, 306, 2, 77, NONE, ""}, // printed once
     };
     mailbox->l2_group = 51;
     mailbox->l2_value = 1;

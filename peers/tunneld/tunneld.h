@@ -1,4 +1,4 @@
-// tunneld: the tunnel daemon of the appliance, as far as wccpd can tell. It takes commands from the mailbox,
+// tunneld: the tunnel daemon of the appliance, as far as wccpd sees it. It takes commands from the mailbox,
 // answers them with indices of its own, keeps a table of its tunnels and prints each command.
 #pragma once
 
@@ -38,7 +38,7 @@ struct tunneld {
     bool attached = false;
     uint32_t next_index = 0;
     std::map<uint16_t, tunneld_tunnel> tunnels; // by tunnel id
-    std::optional<tunneld_command> passed_over; // the command that is left unanswered, told once
+    std::optional<tunneld_command> passed_over; // the command that is left unanswered, printed once
     std::map<uint16_t, uint32_t> roles;         // of policy groups, where not UNKNOWN
 };
 

@@ -1,4 +1,4 @@
-// tunneld's side of the mailbox on a thread of a test: records each command and answers as it is told.
+// tunneld's side of the mailbox on a thread of a test: records each command and answers as the test wants.
 #pragma once
 
 #include <atomic>
@@ -55,6 +55,6 @@ std::optional<tunneld_answer> tunneld_is_silent(const seen_command &command);
 // Runs `work` on a thread, and cancels it once `tunneld` has seen its command and left it unanswered.
 void cancel_while_it_waits(fake_tunneld *tunneld, const std::function<void()> &work);
 
-// The configuration file with the mailbox's line, where wccpd looks for it. Before wccp_init_shmem.
-// Writes the line for the mailbox and lets the process make its block once more.
+// Writes the configuration file with the mailbox's line, and lets the process create its block once more.
+// Call it before wccp_init_shmem.
 void write_mem_conf();
