@@ -64,6 +64,13 @@ constexpr fault FAULTS[] = {
          }
      },
      nullptr},
+    {"nobodys-map",
+     [](i_see_you *message, std::string *) {
+         for (mask_set &set : message->map)
+             for (mask_value &value : set.values)
+                 value.owner = 0;
+     },
+     nullptr},
     {"other-service", [](i_see_you *message, std::string *) { message->service.priority ^= 1; }, nullptr},
     {"other-group", [](i_see_you *message, std::string *) { message->service.id ^= 0x80; }, nullptr},
     {"hash-revision",
