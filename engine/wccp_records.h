@@ -88,7 +88,7 @@ struct wccp_interface {
     be32 ipa;
     uint32_t link_up;
     uint32_t ready_flags;
-    int32_t ucast_fd; // -1 closed; see wccp_network.cpp for the lock under which the descriptors change
+    int32_t ucast_fd; // -1 closed; changes under the lock of wccp_packet_io.cpp
     int32_t mcast_fd;
     uint32_t ucast_bound;
     uint32_t mcast_bound;
