@@ -107,7 +107,7 @@ lc_status value_text(const bn_binding *binding, owned_tstring *out) {
     return LC_OK;
 }
 
-// Each step tells in `ended` whether what it found ends the operation.
+// Each step says in `ended` whether what it has found ends the search. No level, empty or deleted, doesn't.
 lc_status change_process_level(const bn_binding *binding, bool *ended) {
     owned_tstring value;
     uint32_t flags = 0;
@@ -117,24 +117,21 @@ lc_status change_process_level(const bn_binding *binding, bool *ended) {
         CHECK_STATUS(value_text(binding, &value));
     LC_LOG(LC_LOG_INFO, "Found process to change level: %s=%s", bn_binding_get_name_quick(binding),
            value.pointer ? ts_str(value.pointer) : "");
-    *ended = false;
-    if (deleted) {
+    *ended = is_filled(value);
+    if (*ended) {
+        CHECK_QUIET(set_daemon_level(ts_str(value.pointer)));
+        LC_LOG(LC_LOG_INFO, "Process log_level='%s'", ts_str(value.pointer));
+    } else if (deleted || value.pointer) {
         CHECK_STATUS(lc_log_set_daemon_log_level(-1));
-        return LC_OK;
     }
-    if (!value.pointer)
-        return LC_OK;
-    *ended = true;
-    CHECK_QUIET(set_daemon_level(ts_str(value.pointer)));
-    LC_LOG(LC_LOG_INFO, "Process log_level='%s'", ts_str(value.pointer));
     return LC_OK;
 }
 
 lc_status change_system_level(const bn_binding *binding, bool *ended) {
     owned_tstring value;
     CHECK_STATUS(value_text(binding, &value));
-    *ended = value.pointer != nullptr;
-    if (!value.pointer)
+    *ended = is_filled(value);
+    if (!*ended)
         return LC_OK;
     CHECK_STATUS(lc_log_set_max_log_level(ts_str(value.pointer)));
     LC_LOG(LC_LOG_INFO, "Syslog log level is set to \"%s\"", ts_str(value.pointer));

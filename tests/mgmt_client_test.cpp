@@ -376,22 +376,60 @@ TEST(client, log_levels_at_start) {
     EXPECT_EQ(lc_log_get_facility(odd.client, "wccpd"), 160);
 }
 
+// Each change meets the system level "warning" and a system-wide override without a level of the class.
 TEST(client, log_levels_on_change) {
+    constexpr const char *PROCESS = "/logging/syslog/process/wccpd/log_level",
+                         *SYSTEM = MESSAGES "all/min_priority", *OVERRIDE = MESSAGES "override/enable",
+                         *CLASS = MESSAGES "single/local0/min_priority";
+    constexpr const char *deleted = nullptr;
+    const struct {
+        std::vector<std::pair<const char *, const char *>> changes;
+        int32_t daemon_level, level;
+        const char *line;
+        lc_status status = LC_OK;
+    } cases[] = {
+        {{{"/qv/wccpd/other", "x"}}, LC_LOG_DEBUG, LC_LOG_WARNING, ""},
+        {{{PROCESS, "info"}, {SYSTEM, "err"}}, LC_LOG_INFO, LC_LOG_WARNING, "Process log_level='info'"},
+        {{{PROCESS, "loud"}, {SYSTEM, "err"}}, LC_LOG_DEBUG, LC_LOG_WARNING, "", LC_BAD_TYPE},
+        {{{PROCESS, ""}, {SYSTEM, "info"}, {OVERRIDE, "false"}}, -1, LC_LOG_INFO, "level is set to \"info\""},
+        {{{PROCESS, deleted}, {SYSTEM, "info"}}, -1, LC_LOG_INFO, "level is set to \"info\""},
+        {{{SYSTEM, ""}, {CLASS, "debug"}},
+         LC_LOG_DEBUG,
+         LC_LOG_DEBUG,
+         "override is enabled, log level is \"debug\""},
+        {{{SYSTEM, deleted}, {OVERRIDE, "false"}}, LC_LOG_DEBUG, LC_LOG_WARNING, "override is disabled"},
+        {{{OVERRIDE, "false"}, {CLASS, "debug"}},
+         LC_LOG_DEBUG,
+         LC_LOG_WARNING,
+         "system-wide override is disabled"},
+        {{{CLASS, "info"}},
+         LC_LOG_DEBUG,
+         LC_LOG_INFO,
+         "per-class local0 override is enabled, log level is \"info\""},
+        {{{CLASS, ""}}, LC_LOG_DEBUG, LC_LOG_WARNING, "per-class local0 override is disabled"},
+    };
     log_lines log;
-    bindings_owner bindings;
-    ASSERT_EQ(bn_binding_array_new(&bindings), 0);
     EXPECT_EQ(qv_handle_log_level_change(nullptr), 0);
-    EXPECT_EQ(qv_handle_log_level_change(bindings), 0);
-    add(bindings, "/logging/syslog/process/wccpd/log_level", nullptr, bn_flag_deleted | bn_flag_absent);
-    add(bindings, MESSAGES "all/min_priority", "info");
-    add(bindings, MESSAGES "override/enable", "true", 0, bn_type_bool);
-    ASSERT_EQ(qv_handle_log_level_change(bindings), 0);
-    EXPECT_EQ(lc_log_get_daemon_log_level(), -1);
-    const std::string lines = log.take();
-    EXPECT_NE(lines.find("Found process to change level: /logging/syslog/process/wccpd/log_level="),
-              std::string::npos);
-    EXPECT_NE(lines.find("Syslog log level is set to \"info\""), std::string::npos) << lines;
-    EXPECT_EQ(lines.find("system-wide override"), std::string::npos);
+    for (const auto &each : cases) {
+        SCOPED_TRACE(each.changes[0].first + std::string(" = ") +
+                     (each.changes[0].second ? each.changes[0].second : "(deleted)"));
+        ASSERT_EQ(lc_log_set_daemon_log_level(LC_LOG_DEBUG), 0);
+        ASSERT_EQ(lc_log_set_max_log_level("warning"), 0);
+        ASSERT_EQ(lc_log_enable_override_log_level(0, 0), 0);
+        ASSERT_EQ(lc_log_enable_override_log_level(1, 1), 0);
+        bindings_owner bindings;
+        ASSERT_EQ(bn_binding_array_new(&bindings), 0);
+        for (const auto &[name, value] : each.changes)
+            add(bindings, name, value, value ? 0 : bn_flag_deleted | bn_flag_absent,
+                name == OVERRIDE ? bn_type_bool : bn_type_str);
+        EXPECT_EQ(qv_handle_log_level_change(bindings), each.status);
+        EXPECT_EQ(lc_log_get_daemon_log_level(), each.daemon_level);
+        EXPECT_EQ(G_log_level, each.level);
+        const std::string lines = log.take();
+        EXPECT_NE(lines.find(each.line), std::string::npos) << lines;
+        EXPECT_EQ(lines.find(".ERR]"), std::string::npos) << lines;
+    }
+    EXPECT_EQ(lc_log_set_daemon_log_level(LC_LOG_DEBUG), 0);
     EXPECT_EQ(qv_handle_time_zone_change("/other"), LC_NOT_FOUND);
     EXPECT_EQ(qv_handle_time_zone_change("/time/notify/zonechange"), 0);
     EXPECT_NE(log.take().find("Time zone change handled OK"), std::string::npos);

@@ -176,7 +176,7 @@ case_start() {
             ctl() { '$WCCP_BIN/mgmtctl' \"\$@\"; sleep 0.0\$((RANDOM % 4)); }
             ctl delete $nodes/$round
             for id in \$(shuf -i 100-255 -n 8); do ctl set $nodes/\$id/weight=$round\$((RANDOM % 100)); done
-            ctl set $nodes/$absent/interface=eth0 $nodes/$absent/weight=$round" >"$LAB/commits.out" 2>&1 &
+            ctl set $nodes/$absent/{interface=eth0,router/1/ipaddr=10.0.0.1,weight=$round}" >"$LAB/commits.out" 2>&1 &
         commits=$!
         lab_wccpd_start a1
         wait $commits || die "commits: $(cat "$LAB/commits.out")"
