@@ -193,23 +193,34 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
     return LC_OK;
 }
 
-lc_status ask_load(mon_subject *subject, bool *answered) {
+// An address that is none is nobody's: no binding, as for an appliance that the router doesn't list.
+void ask_load(mon_subject *subject, bool *answered) {
     uint32_t address = 0;
-    CHECK_STATUS(lc_str_to_ipv4addr(tstr_array_get_str_quick(subject->parts, ADDRESS_PART), &address));
     wccp_router_appliance_info info = {};
     info.group_id = subject->group;
     info.router_num = subject->router.router_num;
+    int status = lc_str_to_ipv4addr(tstr_array_get_str_quick(subject->parts, ADDRESS_PART), &address);
     info.ipa = to_be32(address);
-    const int status = wccp_get_router_appliance_info(&info);
+    if (status == 0)
+        status = wccp_get_router_appliance_info(&info);
     if (status != 0) {
         LC_LOG(LC_LOG_ERR, "wccp_get_router_appliance_info: failed: status=%d", status);
         *answered = false;
     }
     subject->load_percent = info.load_percent;
-    return LC_OK;
 }
 
-lc_status append_dump(const mon_subject *subject, const mon_node *node, bn_binding_array *out) {
+struct dump_failures_logged_at {
+    explicit dump_failures_logged_at(int32_t level) : before(wccp_dump_failure_level) {
+        wccp_dump_failure_level = level;
+    }
+    ~dump_failures_logged_at() { wccp_dump_failure_level = before; }
+    dump_failures_logged_at(const dump_failures_logged_at &) = delete;
+    dump_failures_logged_at &operator=(const dump_failures_logged_at &) = delete;
+    int32_t before;
+};
+
+lc_status append_dump(const mon_subject *subject, const mon_node *node, bool in_walk, bn_binding_array *out) {
     const mon_dump *dump = node->dump;
     owned<void, wccp_free> memory(wccp_malloc(dump->size));
     if (!memory.pointer) {
@@ -218,6 +229,7 @@ lc_status append_dump(const mon_subject *subject, const mon_node *node, bn_bindi
     }
     csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.pointer, dump->size);
     CHECK_NULL(buffer);
+    const dump_failures_logged_at level(in_walk ? LC_LOG_INFO : LC_LOG_ERR);
     if (dump->print(buffer, subject->group) != 0 && !dump->cut_text_counts)
         return LC_OK;
     CHECK_STATUS(append_text(subject->name, node->type, csys_display_buf_text(buffer), out));
@@ -226,7 +238,7 @@ lc_status append_dump(const mon_subject *subject, const mon_node *node, bn_bindi
 
 } // namespace
 
-lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_parts, void *,
+lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_parts, void *in_walk,
                                bn_binding_array *out) {
     LC_LOG(LC_LOG_INFO, "MonGet %s", node_name);
     if (!wccpd_is_under(node_name, NODE_WCCPD)) {
@@ -253,11 +265,11 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
         if (!matches(&subject, node.pattern))
             continue;
         if (node.dump) {
-            CHECK_STATUS(append_dump(&subject, &node, out));
+            CHECK_STATUS(append_dump(&subject, &node, in_walk && *static_cast<const bool *>(in_walk), out));
             return LC_OK;
         }
         if (strcmp(last, "load_dist") == 0)
-            CHECK_STATUS(ask_load(&subject, &answered));
+            ask_load(&subject, &answered);
         if (!answered)
             return LC_OK;
         mon_value value = {};

@@ -4,6 +4,7 @@
 #include <cstdio>
 
 #include "engine/wccp_debug_pieces.h"
+#include "engine/wccp_debug_utils.h"
 #include "engine/wccp_utils.h"
 
 static const char *const method_words[] = {"not set", "hash", "mask", "either"};
@@ -144,7 +145,7 @@ int wccp_print_service_grp_assignment_details_by_grp_ptr(wccp_service_group *gro
     };
     for (const auto &part : parts)
         if (part.print(group, buffer)) {
-            QV_LOG(LC_LOG_ERR, "WCCP: %s failed.", part.words);
+            QV_LOG(wccp_dump_failure_level, "WCCP: %s failed.", part.words);
             return 1;
         }
     return 0;

@@ -281,11 +281,13 @@ static const group_row alarm_rows[] = {
      [](wccp_piece *p, const wccp_service_group *g) { put_countdown(p, &g->assign_alarm_timer); }},
 };
 
+int32_t wccp_dump_failure_level = LC_LOG_ERR;
+
 static int wccp_print_global_info(csys_display_buf *buffer) {
     wccp_piece piece = wccp_group_piece(buffer);
     wccp_piece_add(&piece, "\n    WCCP GLOBAL INFO\n\n");
     if (wccp_piece_flush(&piece) || wccp_print_rows(&piece, global_rows, &wccp_g)) {
-        QV_LOG(LC_LOG_ERR, "WCCP display print failed. %s", __func__);
+        QV_LOG(wccp_dump_failure_level, "WCCP display print failed. %s", __func__);
         WCCP_BAIL_ON_ZERO(true);
     }
     return 0;
@@ -326,8 +328,9 @@ static int wccp_print_icu_sending_router_info(const wccp_sending_router *router,
                                               csys_display_buf *buffer) {
     const int status = print_sending_router_rows(router, number, buffer);
     if (status != 0)
-        QV_LOG(LC_LOG_ERR, "WCCP: %s failed. length (%u) buf len (%u)", "printing sending router",
-               csys_display_buf_bytes_used(buffer), csys_display_buf_bytes_max(buffer));
+        QV_LOG(wccp_dump_failure_level, "WCCP: %s failed. length (%u) buf len (%u)",
+               "printing sending router", csys_display_buf_bytes_used(buffer),
+               csys_display_buf_bytes_max(buffer));
     return status;
 }
 
@@ -351,7 +354,7 @@ static int wccp_print_service_group(wccp_service_group *group, csys_display_buf 
     for (wccp_sending_router *router = group->sending_routers; router; router = router->next, number++) {
         const int status = wccp_print_icu_sending_router_info(router, number, buffer);
         if (status != 0) {
-            QV_LOG(LC_LOG_ERR, "WCCP: %s failed. status  (%d) length (%u) buf len (%u)",
+            QV_LOG(wccp_dump_failure_level, "WCCP: %s failed. status  (%d) length (%u) buf len (%u)",
                    "printing sending router", status, csys_display_buf_bytes_used(buffer),
                    csys_display_buf_bytes_max(buffer));
             return status;
@@ -390,7 +393,7 @@ static int append_closing_line(csys_display_buf *buffer) {
 
 // What went wrong in a part of an entry point, in the words of that entry point.
 static int part_failed(const char *words) {
-    QV_LOG(LC_LOG_ERR, "WCCP: %s failed.", words);
+    QV_LOG(wccp_dump_failure_level, "WCCP: %s failed.", words);
     return 1;
 }
 
@@ -398,8 +401,9 @@ int wccp_print_global(csys_display_buf *buffer) {
     wccp_engine_lock lock;
     const int status = wccp_print_global_info(buffer);
     if (status != 0) {
-        QV_LOG(LC_LOG_ERR, "WCCP: %s failed. status (%d) length (%u) buf len (%u)", "printing global info",
-               status, csys_display_buf_bytes_used(buffer), csys_display_buf_bytes_max(buffer));
+        QV_LOG(wccp_dump_failure_level, "WCCP: %s failed. status (%d) length (%u) buf len (%u)",
+               "printing global info", status, csys_display_buf_bytes_used(buffer),
+               csys_display_buf_bytes_max(buffer));
         return 1;
     }
     return append_closing_line(buffer);
@@ -428,7 +432,7 @@ int wccp_print_all_wccp_info(csys_display_buf *buffer) {
         for (wccp_service_group *group = wccp_g.group_list; group; group = group->next) {
             const int status = print_one_of_all(group, buffer);
             if (status != 0) {
-                QV_LOG(LC_LOG_ERR, "WCCP: %s failed. status  (%d) length (%u) buf len (%u)",
+                QV_LOG(wccp_dump_failure_level, "WCCP: %s failed. status  (%d) length (%u) buf len (%u)",
                        "print all failed", status, csys_display_buf_bytes_used(buffer),
                        csys_display_buf_bytes_max(buffer));
                 return status;

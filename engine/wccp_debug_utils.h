@@ -11,6 +11,9 @@ constexpr uint32_t WCCP_DUMP_GROUP_BYTES = 16384;
 constexpr uint32_t WCCP_DUMP_ASSIGNMENT_BYTES = 65536;
 constexpr uint32_t WCCP_DUMP_ALL_BYTES = 65536;
 
+// The level at which a dump that did not fit is logged. Main thread only, as the entry points.
+extern int32_t wccp_dump_failure_level;
+
 int wccp_print_global(csys_display_buf *buffer);
 int wccp_print_all_wccp_info(csys_display_buf *buffer);
 int wccp_print_service_grp(csys_display_buf *buffer, int id);

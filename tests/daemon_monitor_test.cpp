@@ -24,11 +24,11 @@ std::string one(uint32_t type, const std::string &text) {
 }
 const std::string NOTHING = "nothing";
 
-std::string get(const std::string &name) {
+std::string get(const std::string &name, bool in_walk = false) {
     owner<tstr_array, tstr_array_free> parts;
     EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
     binding_list out;
-    const lc_status status = wccpd_mon_handle_get(name.c_str(), parts, nullptr, out.array);
+    const lc_status status = wccpd_mon_handle_get(name.c_str(), parts, &in_walk, out.array);
     const uint32_t count = bn_binding_array_length_quick(out.array);
     if (status != LC_OK || count != 1)
         return status ? "status " + std::to_string(status) : count ? "too much" : NOTHING;
@@ -147,7 +147,8 @@ TEST_F(DaemonMonitor, RoutersAreCountedByTheirPlace) {
     EXPECT_EQ(of_51("router/1/appliance/10.0.0.1/load_dist"), one(bn_type_uint32, "0"));
     EXPECT_EQ(of_51("router/1/appliance/10.0.0.3/load_dist"), NOTHING);
     EXPECT_EQ(said("wccp_get_router_appliance_info: failed: status=1"), 1);
-    EXPECT_EQ(of_51("router/1/appliance/nobody/load_dist"), "status 14020");
+    EXPECT_EQ(of_51("router/1/appliance/nobody/load_dist"), NOTHING);
+    EXPECT_EQ(said("wccp_get_router_appliance_info: failed: status=14020"), 1);
 }
 
 TEST_F(DaemonMonitor, NodesThatOnlyStandForTheirChildren) {
@@ -193,7 +194,14 @@ TEST_F(DaemonMonitor, TheTexts) {
     EXPECT_LT(cut.size(), 16384u);
     EXPECT_EQ(cut.back(), '\n');
     EXPECT_EQ(of_51("assignment"), NOTHING);
+    EXPECT_GT(said(".ERR]"), 1);
+    engine.log.clear();
+    EXPECT_EQ(get(STATE + "/51/debug", true), cut);
+    for (const std::string &each : {STATE + "/51/assignment", SYSTEM + "debug_all"})
+        EXPECT_EQ(get(each, true), NOTHING);
+    EXPECT_EQ(said(".ERR]"), 0);
     EXPECT_EQ(get(SYSTEM + "debug_all"), NOTHING);
+    EXPECT_GE(said(".ERR]"), 1);
     EXPECT_TRUE(holds(get(SYSTEM + "debug_global"), "debug buffer: used"));
 }
 
