@@ -261,9 +261,8 @@ const group_node *find_changing_node(const char *name) {
     return nullptr;
 }
 
-// What the start read says more of a group than a change that it contains: the group is there without the
-// deleted node, and with the router entries, the priority and the protocol that a running group cannot be
-// given.
+// A change that the answer contains leaves nothing to do where a running group could not follow it: the group
+// was made without the deleted node, and with the router entries, priority and protocol of the change.
 lc_status change_group(const char *name, const tstr_array *parts, const bn_binding *binding, bool deleted,
                        config_change_time time) {
     constexpr uint32_t GROUP_PART = 5, NODE_PART = 6, NODE_PARTS = 7;

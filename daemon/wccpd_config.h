@@ -6,9 +6,8 @@
 
 lc_status wccpd_config_query();
 
-// When a change arrived. The engine follows one that arrived during the start as it does any other, but finds
-// without complaint that it has been followed already: an added group is there, a group of a deleted or
-// changed node is gone.
+// When a change arrived. One that arrived during the start may be in what the start has read: an added group
+// that exists already, and a missing group for a changed or deleted node, are no errors then.
 enum config_change_time {
     CONFIG_CHANGE_RUNNING,
     CONFIG_CHANGE_DURING_START, // after the answer from which the groups were made

@@ -1,10 +1,9 @@
 // Changes of the configuration that arrive while the start is still reading it.
 //
-// mgmtd sends a change at the moment of its commit, so that it can arrive before an answer of the start, or
-// after the answer in the same read, while the groups of that answer don't exist yet. Changes are therefore
-// kept, in order, until the whole configuration has been read, and are applied then. A change that was
-// committed before the answer was given is in the answer as well; wccpd_config_apply is told, and takes it
-// without complaint.
+// mgmtd sends a change at the moment of its commit. The change can follow an answer in the same read, and
+// would then reach the engine before the groups of that answer exist. Changes are therefore kept, in order,
+// and applied once the whole configuration has been read. One that was committed before the answer was given
+// is also part of the answer; wccpd_config_apply is told so.
 //
 // Main thread only. The memory in use is bounded.
 #pragma once

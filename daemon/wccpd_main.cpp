@@ -7,14 +7,16 @@
 // wccpd_initiate_exit can therefore run nested in such a wait, and every wait ends by itself once
 // wccpd_exiting is set.
 //
-// The order of the start is not free: the engine asks mgmtd for the system mode and the primary interface, so
-// the session stands before it; the alarm session stands before the engine can raise anything. A start that
-// fails half way does not end the process: it sits in its loop, never ready, until a signal comes.
+// The order of the start is fixed: the engine asks mgmtd for the system mode and the primary interface, so it
+// needs the session, and the alarm session must exist before the engine can raise anything. How far the start
+// has come is told by m_daemon_status alone. Until it is WCCPD_READY, queries are dropped and changes of the
+// configuration are kept (wccpd_early_changes.h). A start that fails does not end the process, which sits in
+// its loop, never ready and deaf to changes, until a signal comes.
 //
-// The order of the exit: alarms are cleared while their session stands, then that session and its thread go,
-// the signal registrations, the working session, and the mailbox is reset. Groups still run then, with the
-// tick idle; wccpd_deinit stops them once the loop has returned. Nothing is ever reconnected or repaired:
-// whoever started the daemon starts it again.
+// The order of the exit: alarms are cleared while their session is open; then that session and its thread
+// end, the signal registrations are removed, the working session is closed, and the mailbox is reset. Groups
+// still run then, with the tick idle; wccpd_deinit stops them once the loop has returned. Nothing is ever
+// reconnected or repaired: whoever started the daemon starts it again.
 //
 // The closed library's thread lives until exit() is through and may call into the engine to the last: the
 // engine's records are plain objects without destructors, and the callbacks return at once when wccpd_exiting
@@ -89,8 +91,8 @@ lc_status wccpd_alarms_init() {
     return qv_alm_mgmt_init(wccpd_program_name);
 }
 
-// What the start waits for mgmtd in. An exit that begins in one of them ends the start there: nothing may be
-// brought up behind the back of what has been taken down.
+// The steps in which the start waits for mgmtd. An exit that begins in one of them ends the start there:
+// nothing may be brought up after the rest has been taken down.
 lc_status (*const wccpd_start_steps[])() = {
     wccpd_mgmt_init,
     wccpd_alarms_init,
@@ -144,8 +146,8 @@ lc_status wccpd_pid_init() {
 
 lc_status wccpd_serv_init() {
     CHECK_CONDITION(wccpd_lwc != nullptr);
-    // The engine's threads order tunnels as soon as the first group has its router, which can be while the
-    // configuration is still read: the ids stand before. wccpd_init tells them when it is through.
+    // The engine's threads order tunnels as soon as the first group has found its router, which can be while
+    // later groups are still being made: they need the ids before wccpd_init logs them.
     (void)qv_encap_setup_entries();
     return wccp_init_mgr();
 }

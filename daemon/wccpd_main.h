@@ -1,5 +1,4 @@
-// The process itself: start-up order, signals, orderly exit, and the cells that tell how far the daemon has
-// come.
+// The process itself: start-up order, signals and orderly exit.
 #pragma once
 
 #include <atomic>
@@ -12,7 +11,8 @@ extern const char *const wccpd_program_name;
 constexpr uint32_t WCCPD_LOG_COMPONENT = 0x1060000;
 extern lew *wccpd_lwc; // the main thread's event loop; null before lew_init and after lew_deinit
 
-// How far the daemon has come. The daemon stores 0 and 1 only; the whole table is what monitoring prints.
+// How far the start has come. The daemon stores 0 and 1 only, and a start that fails stays at 0; the whole
+// table is what monitoring prints.
 enum : int32_t { WCCPD_INITIALIZING = 0, WCCPD_READY = 1 };
 extern std::atomic<int32_t> m_daemon_status;
 extern const lc_enum_entry wccpd_status_table[];

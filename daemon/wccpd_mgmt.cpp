@@ -2,9 +2,10 @@
 //
 // Everything here runs on the main thread inside the loop, and nests: a request of the daemon's own is waited
 // for by running the loop again (mgmt/client_session.h), so that events, queries and the loss of the session
-// are handled in the middle of it. Handlers run inside the session's recursive locks; the engine lock is
-// taken behind them, inside the engine. A failing handler never ends the session. The session is never
-// reconnected: its loss, or the word that tunneld has gone, begins the exit.
+// are handled in the middle of it. Only changes of the configuration are not handled there during the start:
+// they are kept until the start has read all of it. Handlers run inside the session's recursive locks; the
+// engine lock is taken after them, inside the engine. A failing handler never ends the session. The session
+// is never reconnected: its loss, or the news that tunneld has gone, begins the exit.
 #include "daemon/wccpd_mgmt.h"
 
 #include <cstring>
