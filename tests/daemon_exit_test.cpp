@@ -222,7 +222,7 @@ struct log_reader {
         for (const char *line : lines) {
             const size_t found = text.find(line, place);
             EXPECT_NE(found, std::string::npos) << line << " is missing or out of its place in\n" << text;
-            place = found == std::string::npos ? place : found;
+            place = found == std::string::npos ? place : found + strlen(line);
         }
     }
     void expect_no_error() {
