@@ -58,7 +58,7 @@ static lc_status put_value(const bn_type_row *row, const bn_attrib *attrib, tbuf
         return put_sized(buffer, offset, tb_buf_maybe(binary), binary ? binary->length : 0, out);
     }
     uint8_t bytes[sizeof attrib->value.bytes];
-    const uint32_t leading = row->wire->leading, size = attrib->value_size;
+    const uint32_t leading = row->wire.leading, size = attrib->value_size;
     if (leading) {
         memcpy(bytes, attrib->value.bytes, leading);
         turn(attrib->value.bytes + stored_address, bytes + leading, ADDRESS_SIZE);
@@ -66,7 +66,7 @@ static lc_status put_value(const bn_type_row *row, const bn_attrib *attrib, tbuf
         return tb_put_buf(buffer, offset, bytes, *out);
     }
     CHECK_CONDITION(size <= sizeof bytes);
-    if (row->wire->kind == wire_kind_number)
+    if (row->wire.kind == wire_kind_number)
         turn(attrib->value.bytes, bytes, size);
     else
         memcpy(bytes, attrib->value.bytes, size);
@@ -76,8 +76,8 @@ lc_status bn_wire_write(const bn_attrib *attrib, tbuffer *buffer, uint32_t offse
     CHECK_NULL(attrib);
     CHECK_NULL(buffer);
     const bn_type_row *row = bn_type_find(attrib->type);
-    CHECK_CONDITION(row && row->wire);
-    const be32 header[] = {to_be32(row->wire->kind), to_be32(attrib->attribute_id), to_be32(attrib->type),
+    CHECK_CONDITION(row && row->wire.kind);
+    const be32 header[] = {to_be32(row->wire.kind), to_be32(attrib->attribute_id), to_be32(attrib->type),
                            to_be32(attrib->type_flags)};
     static_assert(sizeof header == HEADER_SIZE);
     uint32_t written = 0;
@@ -127,9 +127,9 @@ static lc_status check_type(uint32_t found, uint32_t expected) {
 // `at` is where the family's part begins, with `rest` bytes from there on.
 static lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t rest) {
     const bn_type_row *row = out->row;
-    if (row->wire->leading) {
+    if (row->wire.leading) {
         out->value = at;
-        out->length = row->wire->leading + ADDRESS_SIZE;
+        out->length = row->wire.leading + ADDRESS_SIZE;
         CHECK_CONDITION(out->length <= rest);
         return LC_OK;
     }
@@ -137,7 +137,7 @@ static lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t r
     out->value = at + 4;
     out->length = number_at(at);
     rest -= 4;
-    if (row->wire->kind == wire_kind_counted) {
+    if (row->wire.kind == wire_kind_counted) {
         if (out->length > rest)
             FAIL_WITH(LC_NO_BUFFER_SPACE);
         if (row->shape == value_shape::text)
@@ -159,8 +159,8 @@ lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, 
     CHECK_CONDITION(type >= 1 && type <= BN_TYPE_LAST);
     const bn_type_row *row = bn_type_find(type);
     CHECK_NULL(row);
-    CHECK_NULL(row->wire);
-    if (number_at(at) != row->wire->kind)
+    CHECK_NULL(bn_attrib_copy_funcs[type].read);
+    if (number_at(at) != row->wire.kind)
         FAIL_WITH(LC_GENERIC);
     CHECK_QUIET(check_type(type_found, type));
     *out = {row, number_at(at + 4), number_at(at + 12) & ~BN_TYPE_MASK, nullptr, 0, 0};
@@ -171,10 +171,10 @@ lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, 
 }
 
 bool bn_wire_has_text(const bn_wire_attrib *found) {
-    return found->row->wire->kind == wire_kind_counted && has_value(found->flags);
+    return found->row->wire.kind == wire_kind_counted && has_value(found->flags);
 }
 static void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
-    const uint32_t leading = found->row->wire->leading;
+    const uint32_t leading = found->row->wire.leading;
     if (!(found->flags & bn_flag_absent))
         out->value_size = found->row->size;
     if (!has_value(found->flags))
@@ -182,7 +182,7 @@ static void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
     if (leading) {
         memcpy(out->value.bytes, found->value, leading);
         turn(found->value + leading, out->value.bytes + stored_address, ADDRESS_SIZE);
-    } else if (found->row->wire->kind == wire_kind_number) {
+    } else if (found->row->wire.kind == wire_kind_number) {
         turn(found->value, out->value.bytes, found->length);
     } else {
         memcpy(out->value.bytes, found->value, found->length);
@@ -197,7 +197,7 @@ void bn_wire_fill(const bn_wire_attrib *found, char *text, bn_attrib *out) {
     out->attribute_id = found->id;
     out->type = found->row->number;
     out->type_flags = found->flags;
-    if (found->row->wire->kind != wire_kind_counted) {
+    if (found->row->wire.kind != wire_kind_counted) {
         fill_in_place(found, out);
     } else if (text) {
         bn_attrib_place_value(out, text, found->length);

@@ -33,8 +33,8 @@ struct bn_type_row {
     bool numeric;
     bn_text_out text_out;
     bn_text_in text_in;
-    const bn_wire_family *wire; // null: none
-    const void *form;           // what a text function needs beside the type
+    bn_wire_family wire; // kind 0: none
+    const void *form;    // what a text function needs beside the type
 };
 
 // Null for a number that is no type.

@@ -337,10 +337,14 @@ TEST_F(Mgmtd, ARefusedStepLeavesEverythingAsItWas) {
                    {bn_set_create, POLICY + "/5", ""}}),
               0u);
     const auto before = daemon.tree.set;
+    std::string deep = GROUP;
+    for (int i = 0; i < 64; i++)
+        deep += "/a";
     const struct {
         set_node bad;
         lc_status code;
     } cases[] = {
+        {{bn_set_modify, deep, "1"}, LC_BAD_PATH},
         {{bn_set_modify, GROUP + "/weight", "70000"}, LC_BAD_ARGUMENT},
         {{bn_set_modify, GROUP + "/weight", "1", bn_type_uint16}, LC_BAD_TYPE},
         {{bn_set_modify, GROUP + "/wait", "1"}, LC_NOT_FOUND},
@@ -523,6 +527,8 @@ TEST_F(Mgmtd, AnInterestHearsWhatItsPatternsName) {
     clear();
     EXPECT_FALSE(server_send_request(&daemon, 1, large.pointer));
     EXPECT_TRUE(sent.empty()) << "wccpd would end its session";
+    action(3, "/mgmtd/events/actions/interest/add", std::vector<event_field>(1025, {"a", {bn_type_str, ""}}));
+    EXPECT_EQ(message(), "more than 1024 fields");
     action(3, "/mgmtd/reboot", {});
     EXPECT_EQ(message(), "No such action: /mgmtd/reboot");
     const auto add = [&](size_t number, size_t length) {

@@ -212,6 +212,7 @@ static void take_action(server *self, uint32_t peer_id, const bn_request_msg *ms
 static void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     std::vector<set_step> steps;
     const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
+    steps.reserve(count);
     for (uint32_t i = 0; i < count; i++) {
         const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
         if (!node || !node->binding)
@@ -282,11 +283,20 @@ int64_t server_tick(server *self) {
     return next;
 }
 
+// Of an action or event: all of them are copied, and those of a report are sent on.
+static constexpr uint32_t FIELDS_MAX = 1024;
+
 static bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
     owned_request msg;
     if (bn_request_msg_deserialize(frame, BN_FRAME_HEADER_BYTES, &msg.pointer) != LC_OK ||
         msg.pointer->msg_type != mtype)
         return false;
+    const bool has_fields = mtype == bn_msg_action_request || mtype == bn_msg_event;
+    if (has_fields && bn_request_per_node_array_length_quick(msg.pointer->nodes) > FIELDS_MAX) {
+        answer(self, peer_id, msg.pointer, LC_BAD_ARGUMENT,
+               "more than " + std::to_string(FIELDS_MAX) + " fields");
+        return true;
+    }
     switch (mtype) {
     case bn_msg_query_request:
         server_answer_query(self, peer_id, msg.pointer);

@@ -155,7 +155,7 @@ static bool has_place(const transport *self, const std::string &name) {
     return is_daemon(name) || clients < static_cast<ptrdiff_t>(CLIENT_SESSIONS_MAX);
 }
 
-static bool take_greeting_response(transport *self, session *client, const std::string &frame) {
+static bool take_greeting_response(transport *self, session *client, std::string_view frame) {
     gcl_wire_greeting_response response;
     if (frame.size() < sizeof(gcl_wire_header) + sizeof response || client->stage != session::greeting_sent) {
         end_session(self, client, "bad greeting response");
@@ -180,7 +180,7 @@ static bool take_greeting_response(transport *self, session *client, const std::
     return true;
 }
 
-static bool take_open_service(transport *self, uint32_t id, session *client, const std::string &frame) {
+static bool take_open_service(transport *self, uint32_t id, session *client, std::string_view frame) {
     gcl_wire_open_service request;
     if (frame.size() < sizeof(gcl_wire_header) + sizeof request || client->stage == session::greeting_sent) {
         end_session(self, client, "bad service open");
@@ -214,7 +214,7 @@ static bool take_open_service(transport *self, uint32_t id, session *client, con
 // --- Frames
 
 static void take_frame(transport *self, uint32_t id, session *client, const gcl_wire_header &header,
-                       const std::string &frame) {
+                       std::string_view frame) {
     const uint16_t proto = to_host(header.proto), mtype = to_host(header.mtype);
     if (proto == GCL_PROTO_ADMIN && mtype == GCL_ADMIN_GREETING_RESPONSE) {
         (void)take_greeting_response(self, client, frame);
@@ -222,7 +222,7 @@ static void take_frame(transport *self, uint32_t id, session *client, const gcl_
         (void)take_open_service(self, id, client, frame);
     } else if (proto == BN_PROTO && client->stage == session::open) {
         owned_tbuffer buffer;
-        if (tb_new_buf(&buffer.pointer, frame.data(), static_cast<int32_t>(frame.size())) != LC_OK ||
+        if (tb_new_buf_const(&buffer.pointer, frame.data(), static_cast<uint32_t>(frame.size())) != LC_OK ||
             !server_take_frame(self->owner, id, mtype, buffer.pointer))
             end_session(self, client, "a message that can't be read, ended");
     } else {
@@ -251,7 +251,7 @@ static void take_frames(transport *self, uint32_t id, session *client) {
         const uint32_t total = to_host(header.total_length);
         if (client->unread.size() - at < total)
             break;
-        const std::string frame = client->unread.substr(at, total);
+        const std::string_view frame = std::string_view(client->unread).substr(at, total);
         at += total;
         take_frame(self, id, client, header, frame);
     }

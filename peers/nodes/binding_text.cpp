@@ -43,6 +43,7 @@ std::string name_of(const bn_binding *binding) {
 std::vector<event_field> fields_of(const bn_request_msg *msg) {
     std::vector<event_field> out;
     const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
+    out.reserve(count);
     for (uint32_t i = 0; i < count; i++)
         if (const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i))
             out.push_back({name_of(node->binding), value_of(node->binding)});
@@ -52,6 +53,7 @@ std::vector<event_field> fields_of(const bn_request_msg *msg) {
 std::vector<event_field> fields_of(const bn_response_msg *msg) {
     std::vector<event_field> out;
     const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
+    out.reserve(count);
     for (uint32_t i = 0; i < count; i++)
         if (const bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i))
             out.push_back({name_of(node->binding), value_of(node->binding)});

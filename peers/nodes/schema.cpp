@@ -4,8 +4,8 @@
 // a range, a length, words or a check of its own. Numbers may be written in hexadecimal, as masks are thought
 // of, and are kept in decimal.
 //
-// The defaults are such that a group takes part once its interface and its routers are set. A text that may be
-// empty has the empty text as its default: deleting a node of a group that has no default costs a running
+// The defaults are such that a group takes part once its interface and its routers are set. A text that may
+// be empty has the empty text as its default: deleting a node of a group that has no default costs a running
 // group its place, since it is deleted and created again.
 #include "peers/nodes/schema.h"
 
@@ -190,6 +190,9 @@ node_name node_name::below(const std::string &part) const {
     return out;
 }
 
+// Far deeper than any node. A peer may send names of millions of parts.
+static constexpr uint32_t NAME_PARTS_MAX = 64;
+
 bool parse_node_name(const std::string &text, node_name *out) {
     owned_tstr_array split;
     int absolute = 0;
@@ -198,6 +201,8 @@ bool parse_node_name(const std::string &text, node_name *out) {
         bn_binding_name_to_parts(text.c_str(), &split.pointer, &absolute) != LC_OK || !absolute)
         return false;
     const uint32_t count = tstr_array_length_quick(split.pointer);
+    if (count > NAME_PARTS_MAX)
+        return false;
     for (uint32_t i = 0; i < count; i++) {
         const char *part = tstr_array_get_str_quick(split.pointer, i);
         if (!part || !*part)

@@ -19,7 +19,7 @@ struct node_name {
     friend bool operator==(const node_name &, const node_name &) = default;
     friend std::strong_ordering operator<=>(const node_name &a, const node_name &b);
 };
-// False for a name that is relative, has no parts or an empty one.
+// False for a name that is relative, has no parts, an empty one, or more than any node has.
 bool parse_node_name(const std::string &text, node_name *out);
 node_name parsed_name(const std::string &text); // no parts for a text that is no name
 
