@@ -412,19 +412,19 @@ static lc_status place_binding(wire_reader *reader, message_extent *extent, bn_b
     return LC_OK;
 }
 
-static lc_status skip_subop(wire_reader *reader, bn_block_size *, uint32_t *out_subop) {
+static lc_status skip_subop(wire_reader *reader, uint32_t *out_subop) {
     uint32_t flags = 0;
     CHECK_STATUS(get_u32(reader, out_subop));
     CHECK_STATUS(get_u32(reader, &flags));
     return LC_OK;
 }
-static lc_status measure_query_node(wire_reader *reader, bn_block_size *size) {
+static lc_status measure_query_node(wire_reader *reader, bn_block_size *) {
     uint32_t subop = 0;
-    return skip_subop(reader, size, &subop);
+    return skip_subop(reader, &subop);
 }
 static lc_status measure_set_node(wire_reader *reader, bn_block_size *size) {
     uint32_t subop = 0;
-    CHECK_STATUS(skip_subop(reader, size, &subop));
+    CHECK_STATUS(skip_subop(reader, &subop));
     for (int i = 0; i < 2 && subop == bn_set_reparent; i++) {
         wire_text text = {};
         CHECK_STATUS(find_string(reader, &text));
