@@ -109,10 +109,8 @@ static lc_status queue_frame(gcl_session *session, tbuffer **inout_buffer, uint3
 }
 
 // Puts the header into the room at the start of the buffer and takes the buffer over.
-static lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtype, tbuffer **inout_buffer,
-                             uint64_t queue_max = GCL_QUEUE_MAX_BYTES) {
+static lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtype, tbuffer **inout_buffer) {
     const auto total = static_cast<uint32_t>(tb_length(*inout_buffer));
-    CHECK_QUIET(check_room(session, total, queue_max));
     const uint32_t sequence = session->sequence++;
     fill_header(tb_buf(*inout_buffer), sequence, proto, mtype, total);
     CHECK_STATUS(queue_frame(session, inout_buffer, sequence));
@@ -122,16 +120,17 @@ static lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtyp
 lc_status gcl_session_send_frame_components(gcl_session *session, uint16_t proto, uint16_t mtype,
                                             uint32_t length, const void *body) {
     CHECK_NULL(session);
-    CHECK_CONDITION(length <= GCL_FRAME_MAX - GCL_HEADER_BYTES && (body || !length));
+    CHECK_CONDITION(body || !length);
     const gcl_session_guard guard(session);
     CHECK_QUIET(check_sendable(session));
+    CHECK_QUIET(check_room(session, uint64_t{GCL_HEADER_BYTES} + length, GCL_QUEUE_MAX_BYTES));
     gcl_owned_buffer buffer;
     CHECK_STATUS(tb_new_size(&buffer.pointer, GCL_HEADER_BYTES + length));
     const uint8_t header[GCL_HEADER_BYTES] = {};
     CHECK_STATUS(tb_append_buf(buffer.pointer, header, sizeof header));
     if (length)
         CHECK_STATUS(tb_append_buf(buffer.pointer, body, length));
-    CHECK_QUIET(send_buffer(session, proto, mtype, &buffer.pointer));
+    CHECK_STATUS(send_buffer(session, proto, mtype, &buffer.pointer));
     return LC_OK;
 }
 
@@ -151,7 +150,8 @@ lc_status gcl_session_send_frame_components_tb(gcl_session *session, uint16_t pr
         return LC_OK;
     }
     CHECK_CONDITION(tb_length(buffer.pointer) >= static_cast<int32_t>(GCL_HEADER_BYTES));
-    CHECK_QUIET(send_buffer(session, proto, mtype, &buffer.pointer));
+    CHECK_QUIET(check_room(session, buffer.pointer->length, GCL_QUEUE_MAX_BYTES));
+    CHECK_STATUS(send_buffer(session, proto, mtype, &buffer.pointer));
     return LC_OK;
 }
 
@@ -164,8 +164,8 @@ lc_status gcl_session_send_refusal_tb(gcl_session *session, uint16_t proto, uint
     CHECK_CONDITION(tb_length(buffer.pointer) >= static_cast<int32_t>(GCL_HEADER_BYTES));
     const gcl_session_guard guard(session);
     CHECK_QUIET(check_sendable(session));
-    CHECK_QUIET(
-        send_buffer(session, proto, mtype, &buffer.pointer, GCL_QUEUE_MAX_BYTES + GCL_QUEUE_RESERVE_BYTES));
+    CHECK_QUIET(check_room(session, buffer.pointer->length, GCL_QUEUE_MAX_BYTES + GCL_QUEUE_RESERVE_BYTES));
+    CHECK_STATUS(send_buffer(session, proto, mtype, &buffer.pointer));
     return LC_OK;
 }
 

@@ -217,8 +217,8 @@ static uint32_t forward(server *self, const std::vector<asked_node> &nodes, bool
     return LC_IO_CLOSED;
 }
 
-// The answer of mgmtd itself, and what the daemon has told. Limits are told to everybody; other failures of
-// the daemon to those who asked for its nodes by name.
+// Sends what mgmtd answers itself and what the daemon has answered. A limit that was met is reported to every
+// asker; another failure of the daemon only to those who asked for its nodes by name.
 static void finish_query(server *self, const pending_query &query, uint32_t code, const std::string &words) {
     if (code == LC_NO_SPACE || code == LC_NO_BUFFER_SPACE) {
         refuse_query(self, query, code, words);
@@ -273,7 +273,7 @@ void server_answer_without(server *self, pending_query query, uint32_t code, con
     finish_query(self, query, code, why);
 }
 
-// Takes over what the daemon answers. False when that doesn't go on: the query has been refused.
+// Takes over the daemon's bindings. False when a limit is met: the query has been refused.
 static bool gather(server *self, pending_query *query, bn_response_msg *msg, size_t bytes) {
     query->gathered_bytes += bytes;
     if (query->gathered_bytes > GCL_FRAME_MAX) {
