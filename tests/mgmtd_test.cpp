@@ -1,5 +1,6 @@
-// mgmtd without sockets: what its file may hold, what a commit does and tells, what queries find, and how a
-// state is asked for. Change events are read with the client library that the daemon reads them with.
+// mgmtd without sockets: what its file may hold, what a commit does and which events it sends, what queries
+// find, and how a state is asked for. Change events are read with the client library that the daemon reads
+// them with.
 #include <algorithm>
 #include <csignal>
 #include <cstdio>
@@ -47,7 +48,7 @@ TEST(ConfigFile, EachBadLineIsToldWithItsReason) {
         {"[/qv/wccpd/wccp/srv_grp/config/256]\nweight = 1\n", "F:1: \"256\" is no number between 0 and 255"},
         {"[/qv/wccpd/wccp/srv_grp/config/051]\n", "F:1: \"051\" is no number between 0 and 255"},
         {"[/qv/nobody]\n", "F:1: nothing can be set below /qv/nobody"},
-        {"weight = 1\n", "F:1: \"weight\" is no name from the root and stands in no section"},
+        {"weight = 1\n", "F:1: \"weight\" is no name from the root, and it is in no section"},
         {section + "speed = 1\n", "F:2: " + GROUP + "/speed: there is no such node in the configuration"},
         {section + "weight\n", "F:2: expected [section] or name = value"},
         {section + "\n# c\nweight = 65536\n",
@@ -115,7 +116,7 @@ TEST(ConfigFile, WhatIsWrittenReadsTheSameWithItsComments) {
     EXPECT_EQ(written.find("weight"), std::string::npos) << "a default is not written";
 }
 
-// --- A server whose messages are kept in the place of being sent
+// --- A server whose messages are kept instead of being sent
 
 namespace {
 struct sent_message {

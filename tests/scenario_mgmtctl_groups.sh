@@ -77,7 +77,7 @@ expect 0 '.done == "recreated" and .commits == 1 and .running and (.note | test(
 grep -A 20 'config/51' "$config" | sort >"$LAB/set"
 printf '%s\n' 'assign_method = hash' 'hash_dst_ip = true' 'interface = eth0' 'password = secret' 'priority = 10' \
     'router/1/ipaddr = 10.0.0.1' 'router/2/ipaddr = 10.0.0.2' '[/qv/wccpd/wccp/srv_grp/config/51]' | sort |
-    diff - "$LAB/set" || fail "the group is not what it was, and defaults stand in the file"
+    diff - "$LAB/set" || fail "the group is not what it was, or defaults are in the file"
 shown '.groups[0] | .state == "ACTIVE" and .designated and (.routers | length == 2 and
     all(.connection == "two-way" and .shares["10.0.0.101"] == 100))'
 

@@ -1,9 +1,8 @@
 // Groups and policy groups are changed in the words of an operator, each command in one commit.
 //
-// What a running group follows only when it is deleted and created again is mgmtd's business: it tells wccpd
-// so, within the one commit. "restart" asks for that by deleting and creating the group in its commit, with
-// what was set. A value that equals the default of its node is left out then: the configuration file holds no
-// defaults.
+// mgmtd has wccpd delete and create a running group that cannot follow a change, within the one commit.
+// "restart" asks for that by deleting and creating the group in its commit, with what was set. A value that
+// equals the default of its node is left out then: the configuration file holds no defaults.
 //
 // After a change, wccpd's list of groups is read until it agrees, for some seconds at most. It is the list
 // and not the group, because a query for a group that wccpd doesn't have is an error line in its log.
@@ -38,7 +37,7 @@ static std::string root_of(const char *above, long number) {
     return std::string(above) + "/" + std::to_string(number);
 }
 
-// False: there was no answer, or a refusal; `inout` tells.
+// False: there was no answer, or a refusal; it is in `inout`.
 static bool ask(const group_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
                 group_result *inout) {
     std::string reason;
@@ -57,7 +56,7 @@ static bool stands(const group_link &link, const std::string &root, group_result
     return true;
 }
 
-// What was set of a group, as far as it can be told: a value that is the fallback counts as not set.
+// What was set of a group, as far as mgmtd shows it: a value that is the fallback counts as not set.
 static bool read_group(const group_link &link, const std::string &root, group_nodes *out,
                        group_result *inout) {
     ctl_reply reply;

@@ -18,16 +18,10 @@
 #include "peers/mgmtctl/nearest_word.h"
 #include "runtime/common.h"
 
-static node_name named(const std::string &text) {
-    node_name out;
-    (void)parse_node_name(text, &out);
-    return out;
-}
-
 // The root of the service group that a configuration node belongs to, "" for others.
 static std::string group_of(const std::string &text) {
-    static const node_name groups = named(NODE_GROUP_CONFIG);
-    node_name name = named(text);
+    static const node_name groups = parsed_name(NODE_GROUP_CONFIG);
+    node_name name = parsed_name(text);
     if (!name.is_under(groups))
         return "";
     name.parts.resize(groups.parts.size() + 1);
@@ -47,11 +41,11 @@ static const std::vector<node_name> &patterns() {
         for (const schema_row &row : schema())
             made.push_back(row.parts);
         for (const char *pattern : wccpd_state_nodes())
-            made.push_back(named(pattern));
+            made.push_back(parsed_name(pattern));
         for (const char *pattern :
              {NODE_ALARMS_RAISED "/*/*/name", NODE_ALARMS_RAISED "/*/*/since",
               NODE_ALARMS_RAISED "/*/*/reporter", NODE_ROLES "/*/code", NODE_ROLES "/*/since"})
-            made.push_back(named(pattern));
+            made.push_back(parsed_name(pattern));
         return made;
     }();
     return all;
@@ -81,7 +75,7 @@ static std::vector<std::string> names_below(const ctl_ask &ask, const node_name 
         if (!choice || !ask(walk, above.text(), &reply))
             break;
         for (const ctl_binding &binding : reply.bindings)
-            if (const node_name name = named(binding.name); name.is_under(above)) {
+            if (const node_name name = parsed_name(binding.name); name.is_under(above)) {
                 found.insert(name.parts[depth]);
                 choice = false;
             }
@@ -129,7 +123,7 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
 
 static bool is_state(const node_name &name) {
     for (const char *root : {NODE_WCCPD_STATE, NODE_GROUP_STATE, NODE_ALARM_STATE})
-        if (name == named(root) || name.is_under(named(root)))
+        if (name == parsed_name(root) || name.is_under(parsed_name(root)))
             return true;
     return false;
 }
@@ -146,7 +140,7 @@ std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &text) {
 // --- Completion
 
 static std::vector<std::string> value_completions(const std::string &name_text, const std::string &begin) {
-    const schema_row *row = find_schema_row(named(name_text));
+    const schema_row *row = find_schema_row(parsed_name(name_text));
     std::string words = row && row->words ? row->words : row && row->type == bn_type_bool ? "true|false" : "";
     std::vector<std::string> out;
     while (!words.empty()) {
@@ -218,13 +212,13 @@ bool query_appliances(const ctl_ask &ask, const std::string &list, unsigned long
 }
 
 bool add_appliances(const ctl_ask &ask, const std::string &root_text, std::vector<ctl_binding> *inout) {
-    static const node_name counts = named(NODE_GROUP_STATE "/*/num_appliances");
-    const node_name root = named(root_text);
+    static const node_name counts = parsed_name(NODE_GROUP_STATE "/*/num_appliances");
+    const node_name root = parsed_name(root_text);
     node_name list = counts;
     list.parts.back() = "appliance";
     std::vector<ctl_binding> counted;
     for (const ctl_binding &binding : *inout)
-        if (matches(counts, named(binding.name)))
+        if (matches(counts, parsed_name(binding.name)))
             counted.push_back(binding);
     // A walk from the list itself down has no count in it.
     if (matches(list, root)) {
@@ -236,7 +230,7 @@ bool add_appliances(const ctl_ask &ask, const std::string &root_text, std::vecto
         counted = reply.bindings;
     }
     for (const ctl_binding &count : counted) {
-        node_name one = named(count.name);
+        node_name one = parsed_name(count.name);
         one.parts.back() = "appliance";
         std::vector<ctl_binding> added;
         if (!query_appliances(ask, one.text(), strtoul(count.value.c_str(), nullptr, 10), &added))
@@ -324,7 +318,7 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
             ended.insert(root);
         if (!stood || name == root)
             continue;
-        const schema_row *row = find_schema_row(named(name));
+        const schema_row *row = find_schema_row(parsed_name(name));
         if (removed && old && row && !row->fallback)
             whole[root].insert(name.substr(root.size() + 1));
         else if (const std::string word = whole_word(name, root);

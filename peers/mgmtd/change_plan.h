@@ -1,4 +1,4 @@
-// In which events a commit is told.
+// The events in which the sessions learn of a commit.
 #pragma once
 
 #include <vector>

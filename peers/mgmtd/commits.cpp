@@ -1,5 +1,5 @@
 // Changes of the configuration: by a session, by the configuration file when it is read again, and what
-// becomes of them. A commit is checked, written to the file, taken over and then told, in this order.
+// becomes of them. A commit is checked, written to the file, taken over and only then sent as events.
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
@@ -44,7 +44,7 @@ static std::vector<event_changes> events_for(const peer &who, std::span<const ch
     return out;
 }
 
-static void tell_change(server *self, const node_tree &before, const commit_result &commit) {
+static void send_change_events(server *self, const node_tree &before, const commit_result &commit) {
     const wccpd_plan plan = plan_for_wccpd(before, self->tree, commit);
     std::vector<std::pair<uint32_t, event_changes>> events;
     bool recreates = false;
@@ -101,7 +101,7 @@ static void take_over(server *self, node_tree next, const commit_result &commit)
     const node_tree before = std::exchange(self->tree, std::move(next));
     if (facility_of(before) != facility_of(self->tree))
         write_facility(self);
-    tell_change(self, before, commit);
+    send_change_events(self, before, commit);
 }
 
 // What mgmtd refuses beyond what a tree by itself shows.

@@ -1,7 +1,7 @@
 // Reading and writing the configuration file.
 //
 //   # a comment, kept when the file is written again
-//   [/qv/wccpd/wccp/srv_grp/config/51]      what follows stands below this node
+//   [/qv/wccpd/wccp/srv_grp/config/51]      the lines that follow are below this node
 //   interface = eth0
 //   router/1/ipaddr = 10.0.0.1
 //   password = "with  blanks"
@@ -37,7 +37,7 @@ static bool unquoted(const std::string &text, std::string *out, std::string *out
         if (text[i] == '"') {
             if (i + 1 == text.size())
                 return true;
-            *out_reason = "text behind the closing quote";
+            *out_reason = "text after the closing quote";
             return false;
         }
         if (text[i] == '\\' && i + 1 < text.size())
@@ -71,7 +71,7 @@ struct parser {
 };
 } // namespace
 
-// The section that a node is written in: its outermost instance, or what stands above it.
+// The section that a node is written in: its outermost instance, or the node above it.
 static node_name section_of(const node_name &name) {
     node_name above;
     for (const std::string &part : name.parts) {
@@ -140,7 +140,7 @@ static bool take_value(parser *state, const std::string &line, std::string *out_
     }
     std::string name_text = trimmed(line.substr(0, equals)), value;
     if (name_text.empty() || (name_text[0] != '/' && state->section.empty())) {
-        *out_reason = "\"" + shown_text(name_text) + "\" is no name from the root and stands in no section";
+        *out_reason = "\"" + shown_text(name_text) + "\" is no name from the root, and it is in no section";
         return false;
     }
     if (name_text[0] != '/')

@@ -20,8 +20,8 @@
 
 static constexpr uint32_t COMPONENT_MGMTD = 5u << 16;
 
-// Nobody has to read what is said: a pipe that is full, or a terminal that is held, loses lines and stops
-// nothing. Up to PIPE_BUF bytes fit whole wherever POLLOUT is told.
+// Nobody has to read this output: a pipe that is full, or a terminal that is stopped, loses lines and blocks
+// nothing. After POLLOUT there is room for PIPE_BUF bytes.
 static void say(const std::string &line) {
     static uint64_t lost;
     std::string text = lost ? "(" + std::to_string(lost) + " lines lost)\n" + line : line;
@@ -67,11 +67,11 @@ static int64_t time_left(int64_t now, std::initializer_list<int64_t> due) {
 int main(int argc, char **argv) {
     std::string config = "/etc/mgmtd.conf", wccpd = "wccpd", tunneld = "tunneld";
     bool check = false, supervise = false;
-    CLI::App app{"The management daemon: keeps the configuration, tells of its changes, asks for states."};
+    CLI::App app{"The management daemon: keeps the configuration, reports its changes, asks for states."};
     app.set_version_flag("--version", std::string("mgmtd ") + wccp_version());
     app.add_option("--config", config, "the configuration file; it is written at each change")
         ->capture_default_str();
-    app.add_flag("--check", check, "read the configuration file, tell what is wrong with it, and end");
+    app.add_flag("--check", check, "read the configuration file, report what is wrong with it, and end");
     app.add_flag("--supervise", supervise, "start tunneld and wccpd, and start them again when they end");
     app.add_option("--wccpd", wccpd, "the program, with --supervise")->capture_default_str();
     app.add_option("--tunneld", tunneld, "the program, with --supervise")->capture_default_str();

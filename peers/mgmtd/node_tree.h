@@ -18,7 +18,7 @@ struct node_tree {
     uint32_t revision = 1;                // goes up with each commit that changes something
 };
 
-// `nodes` made anew of `set`.
+// Makes `nodes` from `set`.
 void tree_refresh(node_tree *tree);
 // What no single value shows: false with the reason.
 bool tree_check(const node_tree &tree, std::string *out_reason);

@@ -17,12 +17,6 @@
 // message.
 static constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
 
-static node_name named(const char *text) {
-    node_name out;
-    (void)parse_node_name(text, &out);
-    return out;
-}
-
 static node_value time_now() {
     owned_text text;
     const auto now = static_cast<lt_time_sec>(time(nullptr));
@@ -52,7 +46,7 @@ static std::string text_or(const std::vector<event_field> &fields, const char *n
 }
 
 static node_name alarm_root(const std::vector<event_field> &fields) {
-    return named(NODE_ALARMS_RAISED)
+    return parsed_name(NODE_ALARMS_RAISED)
         .below(text_or(fields, "alarm_type", "0"))
         .below(text_or(fields, "param_3", "-"));
 }
@@ -78,7 +72,7 @@ static void take_clear(server *self, uint32_t, const std::vector<event_field> &f
 }
 
 static void take_role(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
-    const node_name root = named(NODE_ROLES).below(text_or(fields, "group", "-"));
+    const node_name root = parsed_name(NODE_ROLES).below(text_or(fields, "group", "-"));
     if (!keep_report(self, peer_id, root))
         return;
     const char *role = role_name(text_or(fields, "role", ""));

@@ -163,7 +163,7 @@ static action_answer remove_interest(server *self, uint32_t peer_id, const std::
     return {};
 }
 
-// What happened to a process, told by whoever started it.
+// What happened to a process, reported by whoever started it.
 static action_answer report_process(server *self, uint32_t, const std::vector<event_field> &fields) {
     static const std::map<std::string, const char *> events = {
         {"crash", EVENT_PROCESS_CRASH},

@@ -1,4 +1,4 @@
-// What may stand in the configuration: one row for each kind of node. "*" in a pattern is a part that the
+// What the configuration may hold: one row for each kind of node. "*" in a pattern is a part that the
 // operator chooses. Everything that mgmtd knows of a node, it knows from its row; mgmtctl helps out of the
 // same.
 #pragma once
