@@ -45,6 +45,7 @@ complains 'mgmtctl: NAME is required*'
 expect 2 '' gte
 complains 'mgmtctl: unknown word "gte"; known are get walk*'
 expect 2 '' set /a=1 /b
+expect 0 'mgmtctl [0-9]*' --version
 expect 0 '/qv/wccpd' complete /qv/wcc
 lab_in a1 test ! -e /tmp/gcl-socks || fail "a question leaves something behind"
 

@@ -14,7 +14,7 @@ enum ctl_exit : int {
     CTL_UNREACHABLE = 3, // no mgmtd, no answer, or the session was lost
     CTL_NOT_FOUND = 4,   // no such node or group
     CTL_PARTLY = 5,      // no longer given: every command is one commit
-    CTL_STANDING = 6,    // alarms --check: an alarm stands
+    CTL_STANDING = 6,    // alarms --check: an alarm is active
     CTL_OUTPUT = 7,      // standard output took not all of it
 };
 

@@ -114,7 +114,7 @@ static void tell_list(const ctl_options &options, const std::vector<listed_group
 static int run(const ctl_options &options, const std::vector<std::string> &words, const char *above,
                const char *kind,
                group_result (*command)(const group_link &link, const std::vector<std::string> &words)) {
-    // What is wrong with the words is told without mgmtd as well.
+    // Wrong words are reported without mgmtd as well.
     struct closer {
         ctl_session *session = nullptr;
         ~closer() {

@@ -37,7 +37,7 @@ static std::string root_of(const char *above, long number) {
     return std::string(above) + "/" + std::to_string(number);
 }
 
-// False: there was no answer, or a refusal; it is in `inout`.
+// False: there was no answer, or a refusal, which `inout` has.
 static bool ask(const group_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
                 group_result *inout) {
     std::string reason;
@@ -56,7 +56,7 @@ static bool stands(const group_link &link, const std::string &root, group_result
     return true;
 }
 
-// What was set of a group, as far as mgmtd shows it: a value that is the fallback counts as not set.
+// What was set of a group, except for values that are the default.
 static bool read_group(const group_link &link, const std::string &root, group_nodes *out,
                        group_result *inout) {
     ctl_reply reply;

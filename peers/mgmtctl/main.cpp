@@ -1,10 +1,10 @@
-// mgmtctl: asks mgmtd, changes the configuration, watches. Its words and exit codes are told in
-// docs/mgmtctl.md.
+// mgmtctl: queries mgmtd, changes the configuration, watches. docs/mgmtctl.md has the commands and exit
+// codes.
 //
-// The signals that end a program only note that they came, so that the session is closed and its socket goes
-// away; then the program ends by the signal after all, for the shell to see. SIGPIPE is not taken, since a
-// session that is lost must be told; a pipe behind standard output that nobody reads any more is found out at
-// the end and ends the program as it would have.
+// The handlers of the signals that end a program only note the signal, because the session has to be closed
+// and its socket removed first. Then the program ends by the same signal, which the shell sees. SIGPIPE is
+// ignored because the loss of the session is reported; a pipe on standard output that nobody reads any more
+// is detected at the end, and ends the program as SIGPIPE would have.
 #include <algorithm>
 #include <cerrno>
 #include <csignal>
@@ -55,8 +55,8 @@ static int finish(int code) {
 
 // --- The command line
 
-// Words that may look like options or lists (behind "--", or in brackets) are shielded from the parser, which
-// would take them apart.
+// Words that look like options or lists but are not (after "--", or in brackets) are shielded from the
+// parser, which would take them apart.
 static constexpr char SHIELD = '\1';
 
 static std::vector<std::string> shielded(int argc, char **argv) {
@@ -89,92 +89,137 @@ static int usage_error(const CLI::App &app, const std::vector<std::string> &argu
     for (const std::string &word : app.remaining(true))
         if (word.starts_with('-'))
             error = "unknown option " + word;
-    fprintf(stderr, "mgmtctl: %s\nmgmtctl: \"mgmtctl --help\" tells what there is\n", error.c_str());
+    fprintf(stderr, "mgmtctl: %s\nmgmtctl: \"mgmtctl --help\" lists the commands\n", error.c_str());
     return CTL_USAGE;
 }
 
-// NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
-int main(int argc, char **argv) {
-    ctl_options options;
-    double seconds = 10;
+// --- Commands
+
+namespace {
+struct command_line {
     CLI::App app{"Asks mgmtd for the state of the appliance, changes its configuration, watches it.",
                  "mgmtctl"};
-    app.set_version_flag("--version", std::string("mgmtctl ") + wccp_version());
-    app.require_subcommand(1);
-    app.fallthrough();
-    app.add_flag("--json", options.json, "JSON in the place of text");
-    app.add_flag("--secrets", options.secrets, "show passwords");
-    app.add_option("--timeout", seconds, "seconds to wait for an answer")
-        ->check(CLI::Range(0.001, 86400.0))
-        ->capture_default_str();
+    ctl_options options;
+    double seconds = 10; // of --timeout
     std::function<int()> run;
     std::vector<std::string> words;
     std::string name = "/";
     bool children = false, leaves = false, existing = false, check = false;
     uint64_t count = 0;
+};
+} // namespace
 
-    const auto add = [&](const char *word, const char *about, std::function<int()> function) {
-        CLI::App *command = app.add_subcommand(word, about);
-        command->callback([&run, function = std::move(function)] { run = function; });
-        return command;
-    };
-    CLI::App *command = add("get", "values of nodes", [&] { return ctl_get(options, words); });
-    command->add_option("NAME", words)->required();
-    command = add("walk", "a node and all below it", [&] {
-        return ctl_walk_nodes(options, name,
-                              children ? ctl_walk::children
-                              : leaves ? ctl_walk::leaves
-                                       : ctl_walk::subtree);
+static CLI::App *add_command(command_line *line, const char *word, const char *about,
+                             std::function<int()> function) {
+    CLI::App *command = line->app.add_subcommand(word, about);
+    command->callback([line, function = std::move(function)] { line->run = function; });
+    return command;
+}
+
+static void add_options(command_line *line) {
+    line->app.set_version_flag("--version", std::string("mgmtctl ") + wccp_version());
+    line->app.require_subcommand(1);
+    line->app.fallthrough();
+    line->app.add_flag("--json", line->options.json, "JSON instead of text");
+    line->app.add_flag("--secrets", line->options.secrets, "show passwords");
+    line->app.add_option("--timeout", line->seconds, "seconds to wait for an answer")
+        ->check(CLI::Range(0.001, 86400.0))
+        ->capture_default_str();
+}
+
+static void add_node_commands(command_line *line) {
+    add_command(line, "get", "values of nodes", [line] { return ctl_get(line->options, line->words); })
+        ->add_option("NAME", line->words)
+        ->required();
+    CLI::App *command = add_command(line, "walk", "a node and all below it", [line] {
+        return ctl_walk_nodes(line->options, line->name,
+                              line->children ? ctl_walk::children
+                              : line->leaves ? ctl_walk::leaves
+                                             : ctl_walk::subtree);
     });
-    command->add_option("NAME", name)->capture_default_str();
-    CLI::Option *only_children = command->add_flag("--children", children, "what is directly below it only");
-    command->add_flag("--leaves", leaves, "only nodes with nothing below them")->excludes(only_children);
-    command = add("set", "set nodes: one commit", [&] { return ctl_change_nodes(options, words, existing); });
-    command->add_option("NAME=VALUE", words, "or NAME VALUE")->required();
-    command->add_flag("--existing", existing, "make no new group, policy group or router");
-    command = add("delete", "delete nodes with all below them: one commit",
-                  [&] { return ctl_delete(options, words); });
-    command->add_option("NAME", words)->required();
-    command = add("watch", "changes, alarms, roles and processes, as they come",
-                  [&] { return ctl_watch(options, words, count); });
-    command->add_option("NAME", words, "changes of this and below it only; * is one part of a name");
-    command->add_option("--count", count, "end after so many events");
-    command = add("alarms", "the alarms that stand", [&] { return ctl_alarms(options, check); });
-    command->add_flag("--check", check, "exit with 6 when there are any");
-    command = add("group", "service groups: add, set, restart, delete, list, words",
-                  [&] { return ctl_group(options, words); });
-    command->add_option("WORD", words);
-    command = add("policy", "policy groups: add, delete, list", [&] { return ctl_policy(options, words); });
-    command->add_option("WORD", words);
-    command = add("show", "the whole appliance in one screen", [&] { return ctl_show(options); });
-    CLI::Option *stay = command->add_flag("--watch", options.watch, "stay, and follow what changes");
-    command->add_option("--below", options.below, "leave so many rows at the top of the terminal alone")
+    command->add_option("NAME", line->name)->capture_default_str();
+    CLI::Option *only_children =
+        command->add_flag("--children", line->children, "what is directly below it only");
+    command->add_flag("--leaves", line->leaves, "only nodes with nothing below them")
+        ->excludes(only_children);
+    command = add_command(line, "set", "set nodes: one commit",
+                          [line] { return ctl_change_nodes(line->options, line->words, line->existing); });
+    command->add_option("NAME=VALUE", line->words, "or NAME VALUE")->required();
+    command->add_flag("--existing", line->existing, "make no new group, policy group or router");
+    add_command(line, "delete", "delete nodes with all below them: one commit",
+                [line] { return ctl_delete(line->options, line->words); })
+        ->add_option("NAME", line->words)
+        ->required();
+}
+
+static void add_watch_commands(command_line *line) {
+    CLI::App *command = add_command(line, "watch", "changes, alarms, roles and processes, as they come",
+                                    [line] { return ctl_watch(line->options, line->words, line->count); });
+    command->add_option("NAME", line->words, "changes of this and below it only; * is one part of a name");
+    command->add_option("--count", line->count, "end after so many events");
+    add_command(line, "alarms", "the alarms that are active", [line] {
+        return ctl_alarms(line->options, line->check);
+    })->add_flag("--check", line->check, "exit with 6 when there are any");
+}
+
+static void add_group_commands(command_line *line) {
+    add_command(line, "group", "service groups: add, set, restart, delete, list, words", [line] {
+        return ctl_group(line->options, line->words);
+    })->add_option("WORD", line->words);
+    add_command(line, "policy", "policy groups: add, delete, list", [line] {
+        return ctl_policy(line->options, line->words);
+    })->add_option("WORD", line->words);
+}
+
+static void add_show_command(command_line *line) {
+    ctl_options *options = &line->options;
+    CLI::App *command = add_command(line, "show", "the whole appliance in one screen",
+                                    [options] { return ctl_show(*options); });
+    CLI::Option *stay = command->add_flag("--watch", options->watch, "stay, and follow what changes");
+    command->add_option("--below", options->below, "leave so many rows at the top of the terminal alone")
         ->check(CLI::Range(0, 1000))
         ->needs(stay);
     command->add_flag_callback(
-        "--colour", [&] { options.colour = 1; }, "in colour, whatever the output is");
+        "--colour", [options] { options->colour = 1; }, "in colour, whatever the output is");
     command->add_flag_callback(
-        "--no-colour", [&] { options.colour = 0; }, "without colour");
-    command = add("complete", "", [&] { return ctl_complete(words.empty() ? "" : words[0]); });
-    command->add_option("WORD", words);
-    command->group(""); // for the shell
+        "--no-colour", [options] { options->colour = 0; }, "without colour");
+}
+
+static void add_shell_command(command_line *line) {
+    CLI::App *command = add_command(
+        line, "complete", "", [line] { return ctl_complete(line->words.empty() ? "" : line->words[0]); });
+    command->add_option("WORD", line->words);
+    command->group(""); // not in the list of commands
+}
+
+static void unshield(std::string *word) {
+    if (word->starts_with(SHIELD))
+        word->erase(0, 1);
+}
+
+// NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
+int main(int argc, char **argv) {
+    command_line line;
+    add_options(&line);
+    add_node_commands(&line);
+    add_watch_commands(&line);
+    add_group_commands(&line);
+    add_show_command(&line);
+    add_shell_command(&line);
 
     take_signals();
     const std::vector<std::string> arguments = shielded(argc, argv);
     try {
         std::vector<std::string> taken = arguments;
-        app.parse(taken);
+        line.app.parse(taken);
     } catch (const CLI::ParseError &error) {
         if (error.get_exit_code() == 0)
-            return app.exit(error) == 0 ? finish(CTL_OK) : CTL_USAGE; // --help
-        return usage_error(app, arguments, error.what());
+            return line.app.exit(error) == 0 ? finish(CTL_OK) : CTL_USAGE; // --help
+        return usage_error(line.app, arguments, error.what());
     }
-    words.push_back(name);
-    for (std::string &word : words)
-        if (word.starts_with(SHIELD))
-            word.erase(0, 1);
-    name = words.back();
-    words.pop_back();
-    options.timeout_ms = static_cast<int64_t>(std::max(1.0, seconds * 1000)); // 1 also for "nan"
-    return finish(run());
+    for (std::string &word : line.words)
+        unshield(&word);
+    unshield(&line.name);
+    line.options.timeout_ms = static_cast<int64_t>(std::max(1.0, line.seconds * 1000)); // 1 also for "nan"
+    return finish(line.run());
 }

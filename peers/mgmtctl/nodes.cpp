@@ -1,12 +1,11 @@
-// Names, as a person types them: completed, put right, and judged by what the change of a node means.
+// Names as a person types them: completed, corrected, and judged by what a change of the node means.
 //
-// The schema says what there can be, without mgmtd; mgmtd is asked only where a part of a name is somebody's
-// choice (a group's number, a file). So the upper parts complete at once, and completion stays quick with
-// hundreds of groups.
+// The schema lists the names that can exist, without mgmtd; mgmtd is queried only where a part of a name is
+// somebody's choice (a group's number, a file). The upper parts therefore complete at once, and completion
+// stays fast with hundreds of groups.
 //
-// A commit may do less than it seems to: wccpd takes some changes of a group only with the group as a whole,
-// and lets a group go of which a node without a default is deleted. The commit is made as it was asked for,
-// and what follows for a running group is told.
+// wccpd takes some changes of a running group only with the group as a whole. The commit is made as it was
+// asked for, and a note says which groups were deleted and created again for it.
 #include "peers/mgmtctl/nodes.h"
 
 #include <algorithm>
@@ -283,7 +282,7 @@ static const ctl_binding *find_binding(const std::vector<ctl_binding> &bindings,
     return nullptr;
 }
 
-// The part of the name behind its group when wccpd takes a change of the node only with the whole group.
+// The part of the name after its group when wccpd takes a change of the node only with the whole group.
 static std::string whole_word(const std::string &name, const std::string &root) {
     const std::string rest = name.size() > root.size() ? name.substr(root.size() + 1) : "";
     for (const group_word &word : group_words())

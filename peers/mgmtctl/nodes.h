@@ -17,7 +17,7 @@ using ctl_ask = std::function<bool(ctl_walk walk, const std::string &name, ctl_r
 // be empty.
 std::string hint_for_missing(const ctl_ask &ask, const std::string &name);
 std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &name);
-// Words that could stand in the place of a beginning: node names up to their next part, or NAME=VALUE.
+// What the beginning of a word can be completed to: node names up to their next part, or NAME=VALUE.
 std::vector<std::string> completions(const ctl_ask &ask, const std::string &word);
 
 // A walk. One whose answer is larger than a message is asked for again in pieces, each below one of the next

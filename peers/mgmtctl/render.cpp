@@ -1,9 +1,10 @@
-// The forms of what mgmtctl tells.
+// What mgmtctl prints.
 //
 // For a person a node is a line "NAME = VALUE"; whoever asks for one node gets its value alone. For a script
-// everything is JSON in which numbers are numbers. The keys are told in docs/mgmtctl.md and don't change.
+// everything is JSON in which numbers are numbers. The keys are documented in docs/mgmtctl.md and don't
+// change.
 //
-// Nothing here ends the program: a pipe that nobody reads any more shows when main looks at standard output.
+// Nothing here ends the program: main finds out at the end that nobody reads standard output any more.
 #include "peers/mgmtctl/render.h"
 
 #include <algorithm>
@@ -123,7 +124,7 @@ ctl_json json_failure(const ctl_failure &failure) {
     return out;
 }
 
-std::string text_failure(const ctl_failure &failure) {
+static std::string text_failure(const ctl_failure &failure) {
     std::string out = "mgmtctl: ";
     if (!failure.node.empty() && !failure.error.starts_with(failure.node))
         out += failure.node + ": ";

@@ -31,12 +31,11 @@ struct ctl_failure {
 };
 int exit_of(uint32_t code); // of a status code that mgmtd answered
 ctl_json json_failure(const ctl_failure &failure);
-std::string text_failure(const ctl_failure &failure);
-// To standard error, or as JSON to standard output; gives the exit code. A program that was told to end says
+// To standard error, or as JSON to standard output; gives the exit code. A program that a signal ends says
 // nothing.
 int tell_failure(const ctl_options &options, const ctl_failure &failure);
 
-// The alarms that stand, from a walk of NODE_ALARMS_RAISED.
+// The active alarms, from a walk of NODE_ALARMS_RAISED.
 struct ctl_alarm {
     std::string type, source, name, text, since, reporter;
 };

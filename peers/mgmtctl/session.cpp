@@ -1,14 +1,14 @@
-// The session: the project's own client library, driven by a loop of this file's over the interest list,
+// A session is one of the project's own client library, driven by a loop in this file over the interest list,
 // which is all that the library asks of its host.
 //
-// One thread. Every wait is a row of rounds, each of which polls what the list holds and calls its functions;
-// these read frames and end in the callbacks here, which turn an answer or an event into text at once, so
-// that nothing of the library is kept. A wait ends with what it waits for, with the loss of the session, at
+// There is one thread. Every wait is a series of rounds. A round polls what the list holds and calls its
+// functions; these read frames and end in the callbacks here, which turn an answer or an event into text at
+// once, and keep nothing of the library. A wait ends with what it waits for, with the loss of the session, at
 // its deadline, or when a signal has asked the program to end (ctl_stop_signal). These signals are blocked
-// from the look at it on until the poll opens them (ppoll), so that none is missed in between.
+// from the check of that variable until ppoll unblocks them: none is missed in between.
 //
 // The library logs what fails. For a person at a terminal these lines are noise beside the reason that is
-// given here, so the log is suspended for as long as the process lives.
+// given here, and the log is suspended for the life of the process.
 //
 // A reason is one sentence without a period: what is wrong, and where a person would look.
 #include "peers/mgmtctl/session.h"
@@ -85,6 +85,7 @@ static void call_ready(const fdic_event_array *events, const std::vector<pollfd>
     }
 }
 
+namespace {
 struct blocked_signals {
     sigset_t before;
     blocked_signals() {
@@ -100,6 +101,7 @@ struct blocked_signals {
 };
 
 enum class round { ran, over, interrupted };
+} // namespace
 
 // One poll until `deadline` (-1: no limit), and what is ready called.
 static round run_round(ctl_session *self, int64_t deadline) {
@@ -178,7 +180,7 @@ static lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
 
 static const char *const OWNER_ONLY = "only root and the user that mgmtd runs as may use it";
 
-// What the library can't tell apart, and what it would leave behind for nobody.
+// What the library reports as one error, checked before it makes a directory and a socket of its own.
 static bool somebody_listens(std::string *out_reason) {
     const std::string path = provider_path();
     struct stat about = {};
@@ -309,8 +311,8 @@ bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, ct
     return send_request(session, msg.pointer, out, out_reason);
 }
 
-bool ctl_action(ctl_session *session, const std::string &name, const std::vector<ctl_binding> &bindings,
-                ctl_reply *out, std::string *out_reason) {
+static bool send_action(ctl_session *session, const std::string &name,
+                        const std::vector<ctl_binding> &bindings, ctl_reply *out, std::string *out_reason) {
     owned_request msg;
     if (bn_action_request_msg_create(&msg.pointer, name.c_str()) != LC_OK)
         return no_memory(out_reason);
@@ -329,7 +331,7 @@ bool ctl_add_interest(ctl_session *session, const std::string &event,
     for (size_t i = 0; i < patterns.size(); i++)
         bindings.push_back({"match/" + std::to_string(i + 1) + "/pattern", "string", patterns[i]});
     ctl_reply reply;
-    if (!ctl_action(session, ACTION_ADD_INTEREST, bindings, &reply, out_reason))
+    if (!send_action(session, ACTION_ADD_INTEREST, bindings, &reply, out_reason))
         return false;
     return reply.code == 0 || fail(out_reason, reply.message);
 }

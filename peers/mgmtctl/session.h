@@ -50,8 +50,6 @@ bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl
 // One commit.
 bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, ctl_reply *out,
              std::string *out_reason);
-bool ctl_action(ctl_session *session, const std::string &name, const std::vector<ctl_binding> &bindings,
-                ctl_reply *out, std::string *out_reason);
 // Asks for an event, only with a binding that matches one of the patterns when there are any.
 bool ctl_add_interest(ctl_session *session, const std::string &event,
                       const std::vector<std::string> &patterns, std::string *out_reason);

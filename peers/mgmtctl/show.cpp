@@ -1,12 +1,12 @@
-// "mgmtctl show": one snapshot, or one that stays live.
+// "mgmtctl show": one snapshot, or a live one.
 //
-// A live snapshot is drawn anew each second and when mgmtd tells of something, at most ten times a second; a
-// snapshot that took long to gather leaves mgmtd and wccpd alone for longer than it took. On a terminal it
-// has the other screen and is written over in one piece; it gives the terminal back when a signal ends or
-// stops it. Below rows that are somebody else's it is a guest: it takes no screen, hides no cursor, and says
-// where each snapshot begins, since the other may have moved the cursor in between. In a file or a pipe it is
-// a line for whatever has changed, with the time, and as JSON a snapshot a line. When mgmtd goes, a live
-// snapshot says so and looks for it once a second.
+// A live snapshot is drawn again each second and at each event of mgmtd, at most ten times a second. After
+// one that took long to gather, mgmtd and wccpd are left alone for longer than it took. On a terminal it uses
+// the alternate screen and is rewritten in one piece; the terminal is restored when a signal ends or stops
+// the program. Below rows that belong to another program it takes no screen, hides no cursor, and addresses
+// the beginning of each snapshot, because the other program may have moved the cursor in between. In a file
+// or a pipe it is a line, with the time, for whatever has changed, and as JSON one snapshot a line. When
+// mgmtd goes, a live snapshot reports that and tries to reach it once a second.
 #include <algorithm>
 #include <cerrno>
 #include <clocale>
@@ -29,8 +29,8 @@
 static constexpr int64_t PERIOD_MS = 1000;
 static constexpr int64_t BURST_MS = 100; // events within it are one
 static constexpr int FILE_COLUMNS = 120;
-static constexpr size_t SCREEN_BYTES = 1 << 16; // those of a large screen, with their colours
-static constexpr int GROUP_ROWS = 5; // of the least snapshot of a group that tells more than a line
+static constexpr size_t SCREEN_BYTES = 1 << 16; // a large screen with its colours
+static constexpr int GROUP_ROWS = 5;            // of the smallest drawing of a group that is more than a line
 
 static volatile std::sig_atomic_t pause_wanted;
 
@@ -38,8 +38,8 @@ namespace {
 struct viewer {
     const ctl_options &options;
     bool terminal = false, on_screen = false;
-    std::vector<std::string> before; // lines as they were last told
-    bool broken = false;             // nobody reads
+    std::vector<std::string> before; // lines as they were last printed
+    bool broken = false;             // nobody reads the output
 };
 } // namespace
 
@@ -103,7 +103,7 @@ static std::string key_of(const std::string &line) {
     return line.starts_with("alarm ") ? line : "";
 }
 
-static void tell_changes(viewer *self, const snapshot &shown) {
+static void print_changes(viewer *self, const snapshot &shown) {
     const std::vector<std::string> now = draw_lines(shown);
     const auto missing = [](const std::vector<std::string> &from, const std::string &line) {
         return std::find(from.begin(), from.end(), line) == from.end();
@@ -128,7 +128,7 @@ static void show_one(viewer *self, const snapshot &shown) {
         return;
     }
     if (self->options.watch && !self->terminal) {
-        tell_changes(self, shown);
+        print_changes(self, shown);
         return;
     }
     screen_form form = form_of(*self);

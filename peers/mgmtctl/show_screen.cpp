@@ -1,11 +1,11 @@
-// The snapshot on a terminal, or in a file of plain lines.
+// A snapshot on a terminal, or as plain lines in a file.
 //
-// Colour says nothing that a letter or a word doesn't say too. Each appliance has a letter and a colour
-// within its group; the strip shows who has the buckets of a table, two halves in a cell where the terminal
-// can, and a bar shows the share that the routers report beside the share asked for.
+// Colour adds nothing that a letter or a word doesn't say. Each appliance has a letter and a colour within
+// its group. The strip shows which appliance has which bucket of a table, two halves in a cell where the
+// terminal can; a bar compares the share that the routers report with the share asked for.
 //
 // What doesn't fit is shortened in steps: fewer routers and appliances of each group, those in trouble first;
-// then one line for a group; then the groups end with how many are not shown.
+// then one line for a group; then the groups that fit, and the number of those not shown.
 #include <algorithm>
 #include <cinttypes>
 #include <cstdarg>
@@ -230,11 +230,11 @@ static void draw_head(screen *on, size_t alarms_most) {
     add_cells(&line, alarms, shown.alarms_total ? style::bad : style::plain);
     add_cells(&line, on->form.corner, style::dim);
     on->end(&line);
-    const size_t told = std::min(shown.alarms.size(), alarms_most);
-    for (size_t i = 0; i < told; i++)
+    const size_t listed = std::min(shown.alarms.size(), alarms_most);
+    for (size_t i = 0; i < listed; i++)
         on->text("! " + alarm_words(shown.alarms[i]), style::bad);
-    if (told < shown.alarms_total)
-        on->text("! " + plural(shown.alarms_total - told, "alarm") + (told ? " more" : ""), style::bad);
+    if (listed < shown.alarms_total)
+        on->text("! " + plural(shown.alarms_total - listed, "alarm") + (listed ? " more" : ""), style::bad);
 }
 
 static void draw_group_head(screen *on, const snapshot_group &group) {
@@ -390,9 +390,9 @@ static std::vector<std::string> draw_whole(const snapshot &shown, const screen_f
 static std::vector<std::string> draw_briefly(const snapshot &shown, const screen_form &form) {
     screen on = {shown, form, {}};
     draw_head(&on, 3);
-    size_t told = 0;
+    size_t drawn = 0;
     for (const snapshot_group &group : shown.groups) {
-        const size_t last = told + 1 < shown.groups_total ? 1 : 0; // the line that tells of the others
+        const size_t last = drawn + 1 < shown.groups_total ? 1 : 0; // the line that counts the others
         if (form.rows > 0 && on.lines.size() + 1 + last > static_cast<size_t>(form.rows))
             break;
         pen line = on.begin();
@@ -403,10 +403,10 @@ static std::vector<std::string> draw_briefly(const snapshot &shown, const screen
         add_cells(&line, group.uptime_ms ? format("  up %-11s", duration_text(group.uptime_ms).c_str()) : "");
         add_cells(&line, one_line(group, shown.brief));
         on.end(&line);
-        told++;
+        drawn++;
     }
-    if (told < shown.groups_total)
-        on.text("and " + plural(shown.groups_total - told, "group") + " not shown", style::dim);
+    if (drawn < shown.groups_total)
+        on.text("and " + plural(shown.groups_total - drawn, "group") + " not shown", style::dim);
     return std::move(on.lines);
 }
 

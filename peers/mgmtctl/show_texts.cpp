@@ -1,10 +1,10 @@
-// What only wccpd's texts tell: which appliance has which bucket, what the designated appliance allots, and
-// the state of a group's interface.
+// Only wccpd's texts say which appliance has which bucket, what the designated appliance allots, and the
+// state of a group's interface.
 //
-// The texts are rows of a label and a value; a row that isn't known is passed over, and a text that was cut
-// gives what stood before the cut. Bounds: lines, routers, appliances and buckets as the engine has them at
-// most. A router's words come as they were stored: of a hash table each word has its first bucket in its
-// highest byte, of a mask table in its lowest bit.
+// The texts are rows of a label and a value. Unknown rows are passed over, and a text that was cut gives what
+// came before the cut. Lines, routers, appliances and buckets are bounded by what the engine can have. The
+// words of an assignment are as they were stored: in a hash table the first bucket is in the highest byte of
+// each word, in a mask table in its lowest bit.
 #include <algorithm>
 #include <bit>
 #include <cstdio>
@@ -116,7 +116,7 @@ void take_assignment_text(const std::string &text, snapshot_group *inout) {
     each_row(text, [&](const dump_row &row) { take_row(&in, row); });
     for (auto &reported : in.tables) {
         const std::string &router = reported.first;
-        snapshot_table &table = reported.second; // names of their own, for clang 14 lets no lambda see parts
+        snapshot_table &table = reported.second; // named, because clang 14 can't capture structured bindings
         finish_table(&table);
         const bool owned =
             std::any_of(table.owners.begin(), table.owners.end(), [](int o) { return o >= 0; });

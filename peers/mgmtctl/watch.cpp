@@ -1,11 +1,11 @@
-// The watch: interests in everything that mgmtd tells of, and each event as a line or as JSON the moment it
-// comes.
+// A watch has interests in every event that mgmtd sends, and prints each as a line or as JSON as soon as it
+// arrives.
 //
-// A change event carries its changes as numbered entries, each of some bindings (kind, name, value after and
-// before). They come sorted by entry, and are told in that order.
+// A change event carries its changes as numbered entries of several bindings each (kind, name, value after
+// and before). They arrive sorted by entry, and are printed in that order.
 //
-// With names the watch is one of these nodes alone. The wait is cut into seconds to look whether anybody
-// still reads: an event that nobody gets to see may be a long time away.
+// With names, only changes of these nodes are watched. The wait ends each second to check whether anybody
+// still reads the output: without an event that would go unnoticed for a long time.
 #include "peers/mgmtctl/watch.h"
 
 #include <cstdio>
@@ -174,14 +174,15 @@ std::vector<std::string> text_event(const ctl_event &event, bool secrets) {
 
 // --- The word
 
-std::vector<std::string> watched_events() {
+static std::vector<std::string> watched_events() {
     std::vector<std::string> out = {EVENT_CONFIG_CHANGE};
     for (const event_row &row : rows)
         out.emplace_back(row.event);
     return out;
 }
 
-std::string watch_pattern(const std::string &name) {
+// A name without a wildcard stands for the node and all below it.
+static std::string watch_pattern(const std::string &name) {
     if (name == "/")
         return "/**";
     return name.find('*') != std::string::npos ? name : name + "/**";
