@@ -279,7 +279,9 @@ TEST_F(Transport, TheSocketIsOursAlone) {
     }
     transport_close(&sockets);
     EXPECT_NE(stat("/tmp/gcl-socks/uds-provider-mgmtd", &about), 0) << "removed at the end";
-    // Left over from one that was killed.
+    // What can't be removed, and what one that was killed has left.
+    ASSERT_EQ(system("mkdir -p /tmp/gcl-socks/uds-provider-mgmtd/kept"), 0);
+    EXPECT_EQ(attempt(), "listens");
     std::ofstream("/tmp/gcl-socks/uds-provider-mgmtd") << "";
     chmod("/tmp/gcl-socks", 0777);
     EXPECT_EQ(attempt(), "listens");

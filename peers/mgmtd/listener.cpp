@@ -74,7 +74,7 @@ static bool move_aside(const listener *self, const std::string &path, uid_t owne
             self->say(path + " belonged to user " + std::to_string(owner) + ", moved to " + aside);
             return true;
         }
-        if (errno == ENOENT) // its owner was faster
+        if (errno == ENOENT) // its owner has removed it
             return true;
         if (errno != EEXIST)
             break;
@@ -156,7 +156,10 @@ static bool open_socket(listener *self, std::string *out_error) {
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     strlcpy(address.sun_path, self->path.c_str(), sizeof address.sun_path);
-    unlink(address.sun_path);
+    struct stat about;
+    if (unlink(address.sun_path) != 0 && errno == EISDIR && lstat(address.sun_path, &about) == 0 &&
+        !move_aside(self, self->path, about.st_uid, out_error))
+        return false;
     self->socket = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (self->socket < 0)
         return fail(out_error, "socket");
@@ -164,7 +167,6 @@ static bool open_socket(listener *self, std::string *out_error) {
     const mode_t before = umask(0177);
     const int bound = bind(self->socket, reinterpret_cast<sockaddr *>(&address), sizeof address);
     umask(before);
-    struct stat about;
     if (bound != 0 || listen(self->socket, BACKLOG) != 0 || lstat(address.sun_path, &about) != 0)
         return fail(out_error, self->path);
     self->device = about.st_dev;

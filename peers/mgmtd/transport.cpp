@@ -1,7 +1,7 @@
 // The sessions' sockets, one poll loop for all of them.
 //
-// A session goes: greeting sent, greeted (the client's name is known), open (the bnode service granted).
-// Frames are whole before anything looks at them, and a header that can't be true ends its session. What a
+// The stages of a session are: greeting sent, greeted (the client's name is known), open (the bnode service
+// is granted). Only whole frames are looked at, and a header that can't be true ends its session. What a
 // client makes mgmtd hold is therefore bounded by GCL_FRAME_MAX in and QUEUE_MAX_BYTES out. A client that
 // doesn't read never stops the others: nothing here blocks.
 //
@@ -24,8 +24,8 @@
 #include "mgmt/gcl_wire.h"
 
 static constexpr const char *PROVIDER_NAME = "mgmtd";
-static constexpr int READS_A_TURN = 16;                          // then the others have theirs
-static constexpr const char *DAEMONS[] = {"wccpd-", "tunneld-"}; // what their names begin with
+static constexpr int READS_A_TURN = 16;                                  // then the other sessions are read
+static constexpr const char *DAEMON_PREFIXES[] = {"wccpd-", "tunneld-"}; // of their session names
 
 static void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken);
 static bool fits_queue(const session &client, size_t bytes) {
@@ -143,7 +143,7 @@ static std::string field_text(const char (&field)[32]) {
 }
 
 static bool is_daemon(const std::string &name) {
-    return std::any_of(std::begin(DAEMONS), std::end(DAEMONS),
+    return std::any_of(std::begin(DAEMON_PREFIXES), std::end(DAEMON_PREFIXES),
                        [&](const char *prefix) { return name.starts_with(prefix); });
 }
 
@@ -171,11 +171,12 @@ static bool take_greeting_response(transport *self, session *client, std::string
         end_session(self, client, "bad version, name or user in its greeting response");
         return false;
     }
-    if (!has_place(self, name)) {
-        end_session(self, client, "of " + name + " refused: too many");
+    const bool allowed = has_place(self, name);
+    client->name = name;
+    if (!allowed) {
+        end_session(self, client, "refused, too many");
         return false;
     }
-    client->name = name;
     client->stage = session::greeted;
     return true;
 }
@@ -312,7 +313,7 @@ static void accept_session(transport *self) {
     send_greeting(self, &client);
 }
 
-// What ends may tell others, who may end of it in turn.
+// The end of a session may be reported to others, and end theirs.
 static void sweep(transport *self) {
     for (bool again = true; again;) {
         again = false;
