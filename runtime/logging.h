@@ -49,8 +49,8 @@ extern const lc_enum_entry lc_log_level_upper_table[]; // "EMERG" to "DEBUG"
 extern const lc_enum_entry lc_log_component_table[];
 extern const lc_enum_entry lc_log_facility_table[]; // "kern" 0 to "local7" 184
 
-// Read by lc_log_get_facility at the start of a program: lines of a word and a number. The word "system" gives
-// the facility of the daemons; mgmtd writes it.
+// Read by lc_log_get_facility at the start of a program: lines of a word and a number. The word "system"
+// gives the facility of the daemons; mgmtd writes it.
 constexpr const char *LC_LOG_FACILITY_FILE = "/var/opt/rvl/syslog_fac.conf";
 
 // True when a line of this level would be written: the test that every statement makes first.
