@@ -1,8 +1,8 @@
 // The bodies of management messages, requests and responses, as a peer may have made them.
 //
-// An input is a mode byte and then a message from its service id on. Whatever of it can be read takes memory
-// in proportion to its bytes and keeps attributes at valid ids only; written and read again it is the same
-// message. Then it goes through those who look at messages: readers by copy and by takeover, the dump, the
+// An input is a mode byte and then a message from its service id on. A message that can be read takes at most
+// eight times its bytes of memory, has attributes at valid ids only, and is the same when written and read
+// again. It is then given to everything that takes messages: readers by copy and by takeover, the dump, the
 // answer to a monitoring query, the change event and the walk by pattern.
 #include <cstdio>
 #include <cstdlib>

@@ -1,9 +1,9 @@
 // Arrays of bindings, and finding bindings in them.
 //
-// A start reads thousands of bindings and asks for most of them by name, once for each group and field. An
-// array in order is searched by halves; one that isn't gets an index of names (array_index.h) at its first
-// larger search. A pattern with a literal start is looked for where that start stands in an array in order,
-// and costs a comparison for every other name elsewhere.
+// A start reads thousands of bindings and looks most of them up by name, once for each group and field. A
+// sorted array is searched by halves; a large unsorted one gets an index of names (array_index.h) at the
+// first search. A pattern that begins with literal text is matched only against the names that begin with it;
+// in an unsorted array each other name costs one comparison.
 #include <algorithm>
 #include <cstring>
 

@@ -1,10 +1,9 @@
 // The bindings of a message in one allocation, with their names, attributes and values.
 //
-// Whoever makes a block adds up first what is going to lie in it, allocates it, and then places exactly that.
-// A placed binding is used and freed like any other, and everything that it holds can be replaced; its own
-// memory is given back with that of the whole block, when the maker and all placed bindings have let go of
-// it. One binding kept of a large message thus keeps all of it: what has to last is copied with
-// bn_binding_dup.
+// To make a block, add up the sizes of everything that goes into it, allocate it, then place exactly that. A
+// placed binding is used and freed like any other, and whatever it holds can be replaced. The block counts
+// its holders: its maker and each placed binding. The last one to let go frees the memory, so one binding
+// kept from a large message keeps all of that message; copy it with bn_binding_dup if it has to last.
 #pragma once
 
 #include <cstddef>
@@ -40,7 +39,7 @@ struct bn_block_builder {
 };
 lc_status bn_block_new(const bn_block_size *size, bn_block_builder *out);
 void *bn_place_record(bn_block_builder *builder, size_t bytes); // zero bytes, aligned to 8
-// Room for a text and a NUL.
+// Room for `length` bytes and a NUL.
 char *bn_place_text(bn_block_builder *builder, size_t length);
 lc_status bn_place_string(bn_block_builder *builder, const char *bytes, size_t length, tstring **out);
 // `out_name` is null for a bare name; otherwise it is room for the name, which the caller fills. The slots
@@ -54,5 +53,5 @@ lc_status bn_place_copy(bn_block_builder *builder, const bn_binding *binding, bn
 lc_status bn_attrib_array_put_placed(bn_attrib_array *array, uint32_t id, bn_attrib *attrib);
 // Of a placed binding.
 bn_block *bn_block_of(bn_binding *binding);
-// With room for so many bindings.
+// An empty array with room for `count` bindings.
 lc_status bn_binding_array_new_sized(bn_binding_array **out, uint32_t count);

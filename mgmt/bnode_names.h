@@ -19,7 +19,7 @@ bool bn_pattern_literal_start(const bn_pattern *pattern, tstring **out);
 
 // The end of the part that begins at `part`: a separator or the end of the name.
 const char *bn_part_end(const char *part);
-// Whether a backslash here escapes the character behind it.
+// Whether a backslash here escapes the next character.
 inline bool bn_escapes(const char *at) {
     return at[0] == '\\' && (at[1] == '\\' || at[1] == '/');
 }

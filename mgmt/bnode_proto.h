@@ -1,9 +1,10 @@
 // Management messages: the records, building and reading them, and sending them on a session.
 //
 // A request carries an ordered list of nodes, each with a binding; a response carries the bindings that
-// answer. On the wire a message is the body of a frame of protocol 2, "bnode". Receiving ends in one callback
-// for each message type, which runs inside the locks of the instance and the session; the message stays the
-// receive path's, a callback that keeps it takes a copy. What a callback returns is dropped.
+// answer. On the wire a message is the body of a frame of protocol 2, "bnode". A received message goes to the
+// callback of its type, which runs with the locks of the instance and the session held. The receive path
+// keeps owning the message: a callback that needs it later takes a copy. The status that a callback returns
+// is ignored.
 #pragma once
 
 #include <cstdint>
@@ -99,7 +100,7 @@ struct bn_response_msg {
     uint32_t db_revision_id; // query and set responses
 };
 
-// What bn_request_get tells of a request's node beside its binding.
+// What bn_request_get returns about a node, other than its binding.
 struct bn_node_info {
     uint32_t subop;
     uint32_t flags;

@@ -1,10 +1,10 @@
-// Messages over a session: protocol 2 of the instance, its state for the instance and for each session,
-// sending, and the way of a received frame to the callback of its type.
+// Messages over a session: protocol 2 with its state per instance and per session, sending, and dispatching
+// received frames to the callback of their type.
 //
-// Everything here runs with the instance's and the session's locks held, in that order, both recursive: a
-// callback may send on its own session, and may wait for an answer by running the loop again, so that further
-// messages of the same session are received inside it. A message lives on this side of the callback and is
-// freed behind it; nothing of the session is touched after the callback but the message.
+// Everything here runs with the instance's and the session's locks held, in that order; both are recursive. A
+// callback may send on its own session, and may wait for an answer by running the loop again, in which case
+// further messages of the session are received inside it. The message is freed when its callback returns, and
+// nothing else of the session is touched after that.
 #include <cstdlib>
 #include <cstring>
 

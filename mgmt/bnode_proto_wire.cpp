@@ -1,8 +1,8 @@
 // Messages on the wire. All integers are big-endian; a string is a 4-byte length and that many bytes.
 //
-// A received message is read twice. The first pass checks all of it against the bytes that came, and adds up
-// what its nodes are going to take; only then is memory taken for them, all at once, and the second pass
-// fills it. The records are such that a node never takes more than eight times its bytes.
+// A received message is read twice. The first pass checks every field against the bytes received and adds up
+// the memory that the nodes need. That is then allocated at once, and the second pass fills it. A peer cannot
+// make a node take more than eight times its bytes on the wire.
 #include <cstdlib>
 #include <cstring>
 
@@ -194,7 +194,7 @@ struct wire_reader {
     const tbuffer *buffer;
     const uint8_t *at, *end;
 };
-// Bytes in the buffer that a length stands for.
+// A counted string, in the buffer.
 struct wire_text {
     const uint8_t *bytes;
     uint32_t length;
@@ -277,7 +277,7 @@ struct wire_name {
     bool bare;     // is "" or "/"
     size_t length;
 };
-// What the first pass tells the second.
+// What the second pass needs to know from the first.
 struct message_extent {
     bn_block_size size;
     bool escapes; // some part of a name has characters to escape
@@ -319,7 +319,7 @@ static lc_status measure_part(const wire_text *part, bool separated, message_ext
     *inout_length += extent->escapes ? write_escaped(part, separated, nullptr) : part->length;
     return LC_OK;
 }
-// Goes past the name.
+// Advances past the name.
 static lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *out) {
     uint8_t absolute = 0;
     CHECK_STATUS(get_bytes(reader, &absolute, sizeof absolute));
@@ -357,7 +357,7 @@ static lc_status write_name(const wire_reader *reader, const wire_name *name, bo
     return LC_OK;
 }
 
-// Goes past the attribute.
+// Advances past the attribute.
 static lc_status find_attribute(wire_reader *reader, bn_wire_attrib *out) {
     const auto offset = static_cast<uint32_t>(reader->at - reader->buffer->buffer);
     CHECK_STATUS(bn_wire_locate(reader->buffer, offset, 0, out));
@@ -607,8 +607,7 @@ static lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers
     return LC_OK;
 }
 
-// Nothing is taken for the nodes before all of them have been found good: a count that the bytes don't bear
-// out costs nothing.
+// No memory is allocated for nodes until all of them have been checked, so a false count costs nothing.
 template <typename Kind>
 static lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Kind::message **out) {
     CHECK_NULL(out);

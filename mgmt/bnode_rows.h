@@ -34,7 +34,7 @@ struct bn_type_row {
     bn_text_out text_out;
     bn_text_in text_in;
     bn_wire_family wire; // kind 0: none
-    const void *form;    // what a text function needs beside the type
+    const void *form;    // further data for the text functions
 };
 
 // Null for a number that is no type.
@@ -70,9 +70,9 @@ struct bn_wire_attrib {
 lc_status bn_check_text(const uint8_t *bytes, uint32_t length);
 // Type 0 takes the one that the bytes have. Nothing is allocated.
 lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_wire_attrib *out);
-// Whether it becomes a text or bytes beside the attribute.
+// Whether its value is a string or bytes, which need memory besides the attribute.
 bool bn_wire_has_text(const bn_wire_attrib *found);
-// Fills a new attribute. `text` is a copy of the value with a NUL behind it, for one that has a text.
+// Fills a new attribute. `text`: a copy of the value followed by a NUL, if bn_wire_has_text.
 void bn_wire_fill(const bn_wire_attrib *found, char *text, bn_attrib *out);
 // The value of a text or binary, in memory that outlives the attribute: `length` bytes and a NUL.
 void bn_attrib_place_value(bn_attrib *attrib, char *text, uint32_t length);

@@ -1,9 +1,9 @@
-// The table of types, and the texts of their values.
+// The table of types, and the conversion of values from and to text.
 //
-// A row says how large a value is, how its bytes are to be read, which functions make text of it and take it
-// from text, and which family of the wire form it has. What is common to a shape, such as comparing, stands
-// once for the shape. Text to value is strict: the whole text, a sign only where the type has one, in range;
-// everything else is LC_BAD_TYPE without a line, since that is how bad input is told.
+// A row gives the size of a value, the meaning of its bytes, the functions that convert it, and its family on
+// the wire. What depends on the shape only, such as comparing, is written once per shape. Conversion from
+// text is strict: the whole text, in range, with a sign only where the type has one. Anything else is
+// LC_BAD_TYPE, which is not logged, since it is how bad input is reported.
 #include "mgmt/bnode_types.h"
 
 #include <arpa/inet.h>

@@ -1,5 +1,5 @@
-// The types of values: their numbers, their texts, their order and their bytes on the wire. All that differs
-// from type to type stands in one table (bnode_types.cpp).
+// The types of values: numbers, conversion from and to text, order, and wire form. What differs between types
+// is in one table (bnode_types.cpp).
 #pragma once
 
 #include <cstdint>
@@ -140,7 +140,7 @@ struct bn_attrib {
         alignas(8) uint8_t bytes[32];
         tstring *string; // owned
         tbuffer *binary; // owned
-        // The record behind its pointer, for a text or bytes that lie in a block (bnode_block.h).
+        // For a string or bytes in a block (bnode_block.h): the record follows the pointer to it.
         struct {
             tstring *string;
             tstring record;
