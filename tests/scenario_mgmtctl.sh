@@ -129,7 +129,7 @@ expect 0 3840 get $G/mask_dst_ip
 expect 0 '' delete $G
 expect 0 'created*' set $G/interface=eth0 $G/router/1/ipaddr=10.0.0.1 $G/password=geheim
 lab_wait 60 '.["51"].router["1"].state == "TWO-WAY connected"' lab_state a1 || fail "the group is not created again"
-expect 0 'no alarm stands' alarms --check
+expect 0 'no alarm is active' alarms --check
 lab_ctl r1 stop >/dev/null
 
 # Meanwhile: what a shell makes of it

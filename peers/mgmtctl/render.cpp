@@ -191,7 +191,7 @@ ctl_json json_alarms(const std::vector<ctl_alarm> &alarms) {
 
 std::string text_alarms(const std::vector<ctl_alarm> &alarms) {
     if (alarms.empty())
-        return "no alarm stands\n";
+        return "no alarm is active\n";
     size_t names = 0, sources = 0;
     for (const ctl_alarm &alarm : alarms) {
         names = std::max(names, alarm.name.size());
