@@ -1,11 +1,10 @@
 // The configuration: read once at the start, then followed change by change while groups run.
 //
 // All configuration is held by mgmtd as bindings; the daemon keeps none of it but the table of policy
-// memberships. Two roads lead into the engine. On the group road a whole wccp_grp_config is built from the
-// subtree of one group and the group is added, or the group is deleted: at the start for every group, later
-// for a change that adds or removes a group's root node. On the node road each changed binding is looked at
-// by itself and one field of the running group is modified. What the nodes of a group mean is told by the
-// table in wccpd_group_nodes.cpp.
+// memberships. Two paths lead into the engine. The group path builds a whole wccp_grp_config from the subtree
+// of one group and adds the group, or deletes it: at the start for every group, later for a change that adds
+// or removes a group's root node. The node path looks at one changed binding at a time and modifies one field
+// of the running group. The table in wccpd_group_nodes.cpp defines what the nodes of a group mean.
 //
 // A binding of the wrong type ends the walk of its array; what was applied before it stays. Nodes are looked
 // up by name through the index of the array, so the time that a start takes grows with the size of the tree

@@ -3,7 +3,7 @@
 // mgmtd sends a change at the moment of its commit. The change can follow an answer in the same read, and
 // would then reach the engine before the groups of that answer exist. Changes are therefore kept, in order,
 // and applied once the whole configuration has been read. One that was committed before the answer was given
-// is also part of the answer; wccpd_config_apply is told so.
+// is also part of the answer; wccpd_config_apply treats it accordingly.
 //
 // Main thread only. The memory in use is bounded.
 #pragma once

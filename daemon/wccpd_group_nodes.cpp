@@ -1,6 +1,6 @@
 // What each configuration node of a service group means.
 //
-// Every node is one row of `group_nodes`; both roads of the configuration (wccpd_config.cpp) take the rows
+// Every node is one row of `group_nodes`; both paths of the configuration (wccpd_config.cpp) take the rows
 // from there. A bad word is no failure: it is logged, and the row's fallback is used instead. A binding of
 // the wrong type is a failure.
 #include "daemon/wccpd_group_nodes.h"

@@ -8,8 +8,8 @@
 // wccpd_exiting is set.
 //
 // The order of the start is fixed: the engine asks mgmtd for the system mode and the primary interface, so it
-// needs the session, and the alarm session must exist before the engine can raise anything. How far the start
-// has come is told by m_daemon_status alone. Until it is WCCPD_READY, queries are dropped and changes of the
+// needs the session, and the alarm session must exist before the engine can raise anything. m_daemon_status
+// alone says how far the start has come. Until it is WCCPD_READY, queries are dropped and changes of the
 // configuration are kept (wccpd_early_changes.h). A start that fails does not end the process, which sits in
 // its loop, never ready and deaf to changes, until a signal comes.
 //
