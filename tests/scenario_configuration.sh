@@ -175,7 +175,7 @@ case_start() {
         lab_stop a1 wccpd || die "ended with $?"
         # A group goes, the one that went before comes back, and eight others change.
         lab_in a1 bash -c "set -e
-            ctl() { '$WCCP_BIN/mgmtctl' \"\$@\"; sleep 0.0\$((RANDOM % 4)); }
+            ctl() { '$WCCP_BIN/mgmtctl' --timeout 60 \"\$@\"; sleep 0.0\$((RANDOM % 4)); }
             ctl delete $nodes/$round
             for id in \$(shuf -i 100-255 -n 8); do ctl set $nodes/\$id/weight=$round\$((RANDOM % 100)); done
             ctl set $nodes/$absent/{interface=eth0,router/1/ipaddr=10.0.0.1,weight=$round}" >"$LAB/commits.out" 2>&1 &

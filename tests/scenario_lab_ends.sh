@@ -16,11 +16,15 @@ marked() { # the processes of our labs
     grep -lzx "LAB_OF_TEST=$LAB_MARK" /proc/[0-9]*/environ 2>/dev/null | cut -d/ -f3
 }
 interrupt() { # SIGNAL SECONDS
-    "${as[@]}" env --default-signal=INT LAB_OF_TEST="$LAB_MARK" \
+    "${as[@]}" setsid env --default-signal=INT LAB_OF_TEST="$LAB_MARK" \
         "$top/lab/topology.sh" --routers 1 --appliances 1 bash -c "$whole" </dev/null >/dev/null 2>&1 &
     local shell=$!
+    # Bash starts it with SIGINT ignored; the moment counts from where env has changed that.
+    while (( 0x$(awk '/^SigIgn/ { print $2 }' /proc/$shell/status) & 2 )); do sleep 0.01; done
     sleep "$2"
-    kill -s "$1" $shell
+    local whom=$shell
+    [ "$1" != INT ] || whom=-$shell # a terminal's ^C reaches all of its processes; a shell alone would wait for its child
+    kill -s "$1" -- $whom
     wait $shell 2>/dev/null
     local i
     for i in $(seq 50); do
