@@ -11,6 +11,7 @@
 #include <gtest/gtest.h>
 #include <malloc.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -470,6 +471,16 @@ TEST_F(Mgmtd, TheFileHoldsEachCommitBeforeItIsTold) {
     daemon.tree.set.erase(hidden);
 
     const auto kept = daemon.tree.set;
+    // Neither a device, which a commit would replace, nor a pipe, which would block, is a configuration file.
+    for (const mode_t kind : {S_IFCHR, S_IFIFO}) {
+        config_file special = {std::string(file) + "/special", {}};
+        config_text text;
+        unlink(special.path.c_str());
+        if (mknod(special.path.c_str(), kind | 0600, kind == S_IFCHR ? makedev(1, 3) : 0) != 0)
+            continue; // devices are root's
+        ASSERT_FALSE(config_load(&special, &text)) << kind;
+        EXPECT_NE(text.errors.find("not a regular file"), std::string::npos) << text.errors;
+    }
     daemon.file.path = std::string(file) + "/no/such/directory";
     EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "9"}}), static_cast<uint32_t>(LC_IO_ERROR));
     EXPECT_EQ(changes(), strings{});

@@ -84,9 +84,17 @@ static bool read_all(int fd, std::string *out) {
 
 bool read_whole_file(const std::string &path, std::optional<std::string> *out, std::string *out_reason) {
     out->reset();
-    const owned_fd file(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    // A pipe would block the open and a device would be replaced by a file.
+    const owned_fd file(open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
     if (file.fd < 0)
         return errno == ENOENT || failed(out_reason);
+    struct stat about;
+    if (fstat(file.fd, &about) != 0)
+        return failed(out_reason);
+    if (!S_ISREG(about.st_mode)) {
+        *out_reason = "is not a regular file";
+        return false;
+    }
     return read_all(file.fd, &out->emplace()) || failed(out_reason);
 }
 

@@ -8,7 +8,8 @@
 
 #include <sys/types.h>
 
-// No value when there is no such file. False with the reason, also for a file of more than 16 MiB.
+// No value when there is no such file. False with the reason, also for a file of more than 16 MiB and for
+// anything but a regular file.
 bool read_whole_file(const std::string &path, std::optional<std::string> *out, std::string *out_reason);
 
 // Asked before the old file is replaced, with what the file system gives back of the new one. False, with the
