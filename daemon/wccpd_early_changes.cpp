@@ -7,6 +7,7 @@
 
 namespace {
 
+constexpr size_t CHANGE_BYTES = 512;  // of a change and its array
 constexpr size_t BINDING_BYTES = 512; // of a binding, its attribute and their arrays
 
 struct early_change {
@@ -23,7 +24,7 @@ struct early_change_list {
 early_change_list kept;
 
 size_t size_of(const bn_binding_array *bindings) {
-    size_t bytes = 0;
+    size_t bytes = CHANGE_BYTES;
     const uint32_t count = bn_binding_array_length_quick(bindings);
     for (uint32_t i = 0; i < count; i++) {
         const bn_binding *binding = bn_binding_array_get_quick(bindings, i);

@@ -382,6 +382,12 @@ TEST_F(DaemonConfig, ChangesOfTheStartAreAppliedAfterIt) {
     EXPECT_EQ(keep_early_change(&second.array.pointer), LC_NO_SPACE);
     EXPECT_NE(second.array.pointer, nullptr);
     EXPECT_EQ(said("Configuration change lost"), 1);
+    lc_status status = LC_OK; // changes without bindings take memory as well
+    for (size_t i = 0; status == LC_OK && i < EARLY_CHANGES_MAX_BYTES / 1000; i++) {
+        binding_list empty;
+        status = keep_early_change(&empty.array.pointer);
+    }
+    EXPECT_EQ(status, LC_NO_SPACE);
 }
 
 TEST_F(DaemonConfig, TheFacilityOfTheLogAndNothingElseOfIt) {
