@@ -1,7 +1,7 @@
 // Queries: of the configuration and of what mgmtd itself reports from memory, of the state of a daemon by
 // asking that daemon.
 //
-// The state nodes of each daemon stand beside the schema; a query below one of their roots goes to the
+// The state nodes of each daemon are listed beside the schema; a query below one of their roots goes to the
 // daemon's session, all nodes of it in one request, with the rows in front as registration nodes. A query of
 // a subtree that holds such a root takes it along, and is none the worse when the daemon isn't there or
 // refuses.
@@ -9,7 +9,7 @@
 // A walk of all service groups is asked for in steps: the list of groups first, then one group after the
 // other. The daemon therefore never builds an answer about more than one group, and a walk that comes to more
 // than a frame is refused here as soon as that is known.
-// A node that can't be told in a message is left out, so that no asker waits in vain. The daemon
+// A node that can't be put into a message is left out, so that no asker waits in vain. The daemon
 // whose session it is asks for its configuration only; it is never asked for what it asked for.
 #include <algorithm>
 

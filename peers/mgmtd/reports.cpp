@@ -1,4 +1,4 @@
-// What the daemons report: alarms that stand and roles of service groups, as nodes that anybody can read.
+// What the daemons report: active alarms and roles of service groups, as nodes that anybody can read.
 //
 //   /qv/alarms/state/raised/TYPE/SOURCE          the text of the alarm; below it name, since, reporter
 //   /qv/alarms/state/role/GROUP                  the role's name; below it code, since
@@ -54,7 +54,7 @@ static node_name alarm_root(const std::vector<event_field> &fields) {
 static void take_raise(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     const node_name root = alarm_root(fields);
     if (!keep_report(self, peer_id, root)) {
-        self->say("alarm lost, too many stand: " + root.text());
+        self->say("alarm lost, too many are active: " + root.text());
         return;
     }
     const std::string comment = text_or(fields, "comment", "", TEXT_MAX);
