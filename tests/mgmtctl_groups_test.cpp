@@ -82,7 +82,7 @@ TEST(Groups, WrongWordsChangeNothingAndAreTold) {
 
 TEST(Groups, OneCommitWhereARunningGroupFollows) {
     fake mgmtd;
-    EXPECT_EQ(mgmtd.run({"set", "51", "weight", "100", "router", "10.0.0.1", "hash-src-ip", "default"}).done,
+    EXPECT_EQ(mgmtd.run({"set", "51", "weight", "0x64", "router", "10.0.0.1", "hash-src-ip", "default"}).done,
               "unchanged");
     EXPECT_TRUE(mgmtd.commits.empty());
     EXPECT_EQ(mgmtd.run({"set", "51", "weight", "7", "password", "default", "policy", "5"}).done, "changed");

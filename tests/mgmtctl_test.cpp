@@ -68,7 +68,8 @@ TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
 
 TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
     const groups_before before = {{G51, GROUPS + "/52"},
-                                  {{G51 + "/priority", "uint32", "200"},
+                                  {{G51 + "/priority", "uint32", "10"},
+                                   {G51 + "/protocol", "string", "tcp"},
                                    {G51 + "/policy_grp", "uint32", "3"},
                                    {G51 + "/weight", "uint32", "100"},
                                    {G51 + "/router/1", "uint8", "1"}}};
@@ -84,7 +85,7 @@ TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
         std::vector<const char *> notes; // a piece of each
     } cases[] = {
         {{set(G51 + "/weight", "7")}, {}, {}},
-        {{set(G51 + "/priority", "200")}, {}, {}},
+        {{set(G51 + "/priority", "10"), set(G51 + "/priority", "0x0a"), remove(G51 + "/protocol")}, {}, {}},
         {{set(G51 + "/priority", "9"), set(G51 + "/router/2/ipaddr", "10.0.0.2")},
          {},
          {"group 51: wccpd takes a change of priority, router only with"}},

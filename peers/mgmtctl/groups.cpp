@@ -16,6 +16,7 @@
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/group_words.h"
+#include "peers/mgmtctl/nodes.h"
 #include "runtime/common.h"
 
 static group_result failed(group_result result, int exit, const std::string &error, uint32_t code = 0) {
@@ -240,15 +241,15 @@ static void group_set(const group_link &link, const std::string &root, const gro
         const auto otherwise = fallback ? std::optional<std::string>(fallback) : std::nullopt;
         const auto old = before.find(node);
         const auto stood = old != before.end() ? std::optional(old->second) : otherwise;
-        const auto to = value ? value : otherwise;
+        const std::string name = root + "/" + node;
+        const auto to = value ? std::optional(kept_value(name, *value)) : otherwise;
         if (to == stood)
             continue;
         if (value)
-            after[node] = *value;
+            after[node] = *to;
         else
             after.erase(node);
-        items.push_back({value ? ctl_change::modify : ctl_change::reset,
-                         {std::string(root).append("/").append(node), "", value.value_or("")}});
+        items.push_back({value ? ctl_change::modify : ctl_change::reset, {name, "", value ? *to : ""}});
         if (word->whole || (!value && !fallback))
             as_whole += std::string(as_whole.empty() ? "" : ", ") + word->word;
     }

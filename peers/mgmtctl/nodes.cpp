@@ -258,6 +258,13 @@ std::string parse_assignments(const std::vector<std::string> &words, ctl_change 
     return "";
 }
 
+std::string kept_value(const std::string &name_text, const std::string &value) {
+    const node_name name = parsed_name(name_text);
+    const schema_row *row = find_schema_row(name);
+    std::string kept, reason;
+    return row && check_value(*row, name, value, &kept, &reason) ? kept : value;
+}
+
 bool look_before(const ctl_ask &ask, const std::vector<ctl_change_item> &items, groups_before *out) {
     for (const ctl_change_item &item : items) {
         const std::string root = group_of(item.binding.name);
@@ -318,10 +325,13 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
         if (!stood || name == root)
             continue;
         const schema_row *row = find_schema_row(parsed_name(name));
+        const std::string after = !removed               ? kept_value(name, item.binding.value)
+                                  : row && row->fallback ? row->fallback
+                                                         : "";
         if (removed && old && row && !row->fallback)
             whole[root].insert(name.substr(root.size() + 1));
         else if (const std::string word = whole_word(name, root);
-                 !word.empty() && (!old || removed || old->value != item.binding.value))
+                 !word.empty() && (!old || old->value != after))
             whole[root].insert(word);
     }
     for (const auto &[root, words] : whole)

@@ -36,6 +36,10 @@ bool add_appliances(const ctl_ask &ask, const std::string &root, std::vector<ctl
 std::string parse_assignments(const std::vector<std::string> &words, ctl_change change,
                               std::vector<ctl_change_item> *out);
 
+// A value of the node in the form in which mgmtd keeps it ("0x0a" as "10"); as it is when mgmtd would refuse
+// it.
+std::string kept_value(const std::string &name, const std::string &value);
+
 // Groups as they stood before a commit, and what there is to be said of it.
 struct groups_before {
     std::set<std::string> roots;       // of groups
