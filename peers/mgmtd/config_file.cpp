@@ -288,13 +288,20 @@ bool config_save(config_file *file, const node_tree &tree, const config_comments
 }
 
 std::string config_protect(const std::string &path) {
+    // By descriptor: the path may name another file by the time its mode is changed.
+    const int fd = open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
     struct stat about;
-    if (stat(path.c_str(), &about) != 0 || (about.st_mode & (S_IRWXG | S_IRWXO)) == 0)
-        return "";
-    char mode[8];
-    snprintf(mode, sizeof mode, "%04o", about.st_mode & 07777u);
-    const std::string found = "the configuration file " + path + " was open to others (mode " + mode + "), ";
-    if (chmod(path.c_str(), about.st_mode & S_IRWXU) == 0)
-        return found + "and is no longer; change the passwords in it if others may have read them";
-    return found + "and its mode can't be changed (" + strerror(errno) + "): make it 0600";
+    std::string out;
+    if (fd >= 0 && fstat(fd, &about) == 0 && S_ISREG(about.st_mode) &&
+        (about.st_mode & (S_IRWXG | S_IRWXO)) != 0) {
+        char mode[8];
+        snprintf(mode, sizeof mode, "%04o", about.st_mode & 07777u);
+        out = "the configuration file " + path + " was open to others (mode " + mode + "), ";
+        out += fchmod(fd, about.st_mode & S_IRWXU) == 0
+                   ? "and is no longer; change the passwords in it if others may have read them"
+                   : std::string("and its mode can't be changed (") + strerror(errno) + "): make it 0600";
+    }
+    if (fd >= 0)
+        close(fd);
+    return out;
 }
