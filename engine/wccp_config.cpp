@@ -2,8 +2,10 @@
 //
 // Records: the wccp_service_group that hangs from wccp_g.groups, wccp_g.group_list and its interface's list.
 // Only the main thread adds and deletes groups, so a new record is built outside the engine lock and linked
-// under it. Groups are also started and stopped on the notifier's thread, by wccp_link_mgr.cpp, with the lock
-// held by the caller. Neither thread is ever cancelled: a group is never left half stopped.
+// under it. The notifier's thread starts and stops groups too (wccp_link_mgr.cpp), and a tick starts those
+// that waited for sockets, both with the lock held by the caller. The main thread and the notifier are never
+// cancelled; the timer thread is cancelled outside a tick, or once there are no groups. A group is therefore
+// never left half started or half stopped.
 //
 // Nothing here keeps a pointer into the caller's wccp_grp_config.
 //
