@@ -1,11 +1,13 @@
-// The bound on what received packets can make this appliance write to its log. Lock held throughout.
+// The bound on what received packets can make this appliance write to its log. Engine lock held throughout,
+// but for the exit, once no receive thread is left.
 //
-// A complaint is a line at warning or error level that says what is wrong with a received packet, or with
-// what it reports. Anybody can send packets, so complaints are counted for the interface that the packet came
-// in on: a burst of 200 lines passes, then 20 a second. What is beyond that is suppressed, and the number of
-// suppressed lines is logged when the flood is over, or after a minute of it.
+// A complaint is a line at notice level or above that any number of packets can cause: what is wrong with a
+// packet or with what it reports, and what failed while it was processed, such as a new router's tunnel.
+// Anybody can send packets, so complaints are counted for the interface that the packet arrived on: a burst
+// of 200 lines passes, then 20 a second. What is beyond that is suppressed, and the number of suppressed
+// lines is logged when the flood is over, or after a minute of it.
 //
-// A function logs its complaints with WCCP_COMPLAIN and needs to know no interface: a scope on the receive
+// A function logs its complaints with WCCP_COMPLAIN and need not know the interface: a scope on the receive
 // thread says which one it is. Without a scope, as on the tick, nothing is suppressed.
 #pragma once
 

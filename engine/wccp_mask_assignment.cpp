@@ -12,6 +12,7 @@
 
 #include <cstring>
 
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_slot_owners.h"
 #include "engine/wccp_utils.h"
 
@@ -70,11 +71,12 @@ void wccp_mask_assignment_calculate_value_table(wccp_service_group *group) {
     *mask = {group->mask_src_ip, group->mask_dst_ip, group->mask_src_port, group->mask_dst_port};
     group->mask_value_bits = group->mask_bits;
     if (group->mask_value_bits > WCCP_MAX_MASK_BITS) {
-        QV_LOG(LC_LOG_WARNING,
-               "WCCP GRP %d: mask assignment: too many bits (%d) set in mask: sip 0x%x dip 0x%x sport 0x%x "
-               "dport 0x%x . using defaultdestination MASK 0x%x",
-               group->id, static_cast<int>(group->mask_value_bits), mask->src_ip, mask->dst_ip,
-               mask->src_port, mask->dst_port, DEFAULT_DST_IP_MASK);
+        WCCP_COMPLAIN(
+            LC_LOG_WARNING,
+            "WCCP GRP %d: mask assignment: too many bits (%d) set in mask: sip 0x%x dip 0x%x sport 0x%x "
+            "dport 0x%x . using defaultdestination MASK 0x%x",
+            group->id, static_cast<int>(group->mask_value_bits), mask->src_ip, mask->dst_ip, mask->src_port,
+            mask->dst_port, DEFAULT_DST_IP_MASK);
         *mask = {0, DEFAULT_DST_IP_MASK, 0, 0};
         group->mask_value_bits = util_wccp_mask_get_bits_set(mask);
     }

@@ -31,7 +31,7 @@
 
 static constexpr uint32_t OPTIONAL_COMPONENTS = 3; // in one I-See-You
 
-// A step of reading a message failed.
+// A step of reading or building a message failed.
 static int failed(const char *words, int status) {
     WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: %s failed.", words);
     return status;
@@ -422,11 +422,8 @@ int run_steps(const build_step (&steps)[Count], wccp_service_group *group, wccp_
     for (const build_step &step : steps) {
         if (step.wanted && !step.wanted(group))
             continue;
-        const int status = step.load(&build);
-        if (status) {
-            QV_LOG(LC_LOG_ERR, "WCCP: %s failed.", step.words);
-            return status;
-        }
+        if (const int status = step.load(&build))
+            return failed(step.words, status);
     }
     return 0;
 }

@@ -130,10 +130,11 @@ static void log_appliances_left_out(wccp_service_group *group, uint32_t left_out
             entry->listing == WCCP_NOT_LISTED_BY_ALL || (again && entry->listing == WCCP_NOT_LISTED_LOGGED);
         if (!due)
             continue;
-        QV_LOG(LC_LOG_WARNING,
-               "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) is not in all sending "
-               "router views). CHECK configuration.",
-               group->id, addr_text(entry->ipa).s, entry->weight);
+        WCCP_COMPLAIN(
+            LC_LOG_WARNING,
+            "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) is not in all sending "
+            "router views). CHECK configuration.",
+            group->id, addr_text(entry->ipa).s, entry->weight);
         entry->listing = WCCP_NOT_LISTED_LOGGED;
     }
 }

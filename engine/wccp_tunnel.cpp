@@ -18,6 +18,7 @@
 
 #include <cstdio>
 
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"
@@ -103,19 +104,19 @@ int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
     }
     owned<wccp_tunnel, free_tunnel> tunnel(static_cast<wccp_tunnel *>(wccp_calloc(1, sizeof(wccp_tunnel))));
     if (!tunnel.pointer) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: Failed to alloc tunnel memory", group);
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: Failed to alloc tunnel memory", group);
         return 1;
     }
     tunnel.pointer->dataplane_index = WCCP_NO_INDEX;
     owned_tunnel_id id;
     if (!id.take_lowest()) {
-        QV_LOG(LC_LOG_ERR, "WCCP GRP %d: No free tunnel id available", group);
+        WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: No free tunnel id available", group);
         return 1;
     }
     if (wccp_add_tunnel_encap(id.id, mailbox_address_of(local), mailbox_address_of(remote),
                               &tunnel.pointer->dataplane_index) == 1) {
-        QV_LOG(LC_LOG_NOTICE, "WCCP GRP %d: failed to add tunnel: id: %d %s <=> %s", group, id.id,
-               addr_text(local).s, addr_text(remote).s);
+        WCCP_COMPLAIN(LC_LOG_NOTICE, "WCCP GRP %d: failed to add tunnel: id: %d %s <=> %s", group, id.id,
+                      addr_text(local).s, addr_text(remote).s);
         return 1;
     }
     const cancel_off_guard whole;

@@ -34,6 +34,7 @@
 
 #include <cstring>
 
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_host.h"
 #include "runtime/cmem.h"
 #include "runtime/guards.h"
@@ -215,7 +216,7 @@ bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32
             silence = {kind->code, wccpd_shutdown_in_progress() == 1, lt_monotonic_ms()};
     }
     if (end == wait_end::TIMED_OUT)
-        QV_LOG(kind->time_out_level, "%s", kind->time_out_line);
+        WCCP_COMPLAIN(kind->time_out_level, "%s", kind->time_out_line);
     if (end != wait_end::ANSWERED)
         return false;
     silence = {};

@@ -16,6 +16,7 @@
 #include <thread>
 #include <vector>
 
+#include "engine/wccp_complaints.h"
 #include "engine/wccp_host.h"
 #include "tests/support/fake_tunneld.h"
 #include "tests/support/log_lines.h"
@@ -231,6 +232,19 @@ TEST_F(Mailbox, ASilentTunneldIsWaitedForOnceInAWhile) {
         const std::string said = log.take();
         EXPECT_TRUE(step.line.empty() ? said.empty() : said.find(step.line) != std::string::npos) << said;
     }
+    // An add is refused for each packet of a new router. They come as fast as the network brings them.
+    wccp_interface wan0 = {};
+    const wccp_complaint_scope complaints(&wan0);
+    int lines = 0;
+    for (int packet = 0; packet < 300; packet++) {
+        EXPECT_EQ(add(), 1);
+        lines += log.say(add_line);
+    }
+    EXPECT_EQ(lines, 200);
+    polls = 0;
+    later(10)();
+    late_answer();
+    EXPECT_EQ(add(), 0) << "and nothing is refused in the tests that follow";
     no_waiting = false;
 }
 

@@ -7,6 +7,7 @@
 
 #include <array>
 #include <cstring>
+#include <functional>
 #include <sstream>
 
 #include "engine/wccp_complaints.h"
@@ -243,6 +244,55 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
     EXPECT_EQ(lines_of(wan0, 11, 1), "21 wan0: 120");
     EXPECT_EQ(lines_of(wan0, 11, 1), "19");
     EXPECT_EQ(wccp_g.rx_failures, 150u + 15 + 5 + 5 + 101 + 1 + 60 * 11);
+}
+
+// What fails while a good packet is processed can be repeated as often as what is wrong with a bad one.
+TEST_F(Messages, WhatAPacketCausesIsBoundedLikeWhatIsWrongWithIt) {
+    const auto report = [](uint32_t id, uint32_t weight, uint32_t also = 0) {
+        wire_bytes its_view = view(id, {{100, weight, 0}});
+        if (also)
+            its_view = view(id, {{also, 1, 0}, {100, weight, 0}});
+        return icu(id, its_view, {by_mask});
+    };
+    process(report(1, 100));
+    process(report(2, 100));
+    group->mask_bits = WCCP_MAX_MASK_BITS + 1;
+    pass_seconds(1);
+    ASSERT_EQ(group->designated, 1u);
+    const struct {
+        const char *line;
+        std::function<bytes(uint32_t)> packet;
+        uint32_t more_appliances; // than there are
+    } rows[] = {
+        {"mask assignment: too many bits", [&](uint32_t i) { return report(1, i % 2 + 1); }, 0},
+        {"is not in all sending router views",
+         [&](uint32_t i) { return report(1, i % 2 + 1, 101 + i % 100); }, 0},
+        {"failed to add tunnel",
+         [this](uint32_t i) {
+             group->ret_method = WCCP_METHOD_GRE;
+             return icu(3 + i % 60, view(3, {}), {capabilities(2, 2, 1)});
+         },
+         0},
+        {"here-i-am: loading web-cache view info failed.", [](uint32_t) { return query(1, 100); }, 1000},
+    };
+    log_lines log;
+    lc_log_set_daemon_log_level(LC_LOG_NOTICE);
+    for (const auto &row : rows) {
+        group->appliance_view_count += row.more_appliances;
+        wccp_interface wan0 = {};
+        int with_line = 0, lines = 0;
+        for (uint32_t i = 0; i < 400; i++) {
+            const wccp_complaint_scope complaints(&wan0);
+            process(row.packet(i));
+            const std::string logged = log.take();
+            with_line += logged.find(row.line) != std::string::npos;
+            for (size_t at = 0; (at = logged.find("TID ", at)) != std::string::npos; at++)
+                lines++;
+        }
+        EXPECT_GT(with_line, 50) << row.line;
+        EXPECT_LE(lines, 200) << row.line;
+        group->appliance_view_count -= row.more_appliances;
+    }
 }
 
 TEST_F(Messages, AnISeeYouThatIsCutLeavesTheGroupAsItWas) {
