@@ -363,16 +363,16 @@ lc_status bn_query_response_msg_append_binding_takeover(bn_response_msg *msg, bn
 }
 
 static lc_status copy_node(const bn_response_node *node, bn_block_builder *builder, bn_response_msg *out) {
-    auto *copy = static_cast<bn_response_node *>(bn_place_record(builder, sizeof *node));
-    CHECK_NULL(copy);
-    copy->placed = true;
-    copy->node_id = node->node_id;
-    copy->msg_type = node->msg_type;
+    owned_response_node copy(static_cast<bn_response_node *>(bn_place_record(builder, sizeof *node)));
+    CHECK_NULL(copy.pointer);
+    copy.pointer->placed = true;
+    copy.pointer->node_id = node->node_id;
+    copy.pointer->msg_type = node->msg_type;
     if (node->binding)
-        CHECK_STATUS(bn_place_copy(builder, node->binding, &copy->binding));
+        CHECK_STATUS(bn_place_copy(builder, node->binding, &copy.pointer->binding));
     if (node->binding && node->binding->parts)
-        CHECK_STATUS(tstr_array_duplicate(node->binding->parts, &copy->binding->parts));
-    CHECK_STATUS(bn_response_per_node_array_append_takeover(out->nodes, &copy));
+        CHECK_STATUS(tstr_array_duplicate(node->binding->parts, &copy.pointer->binding->parts));
+    CHECK_STATUS(bn_response_per_node_array_append_takeover(out->nodes, &copy.pointer));
     return LC_OK;
 }
 static lc_status copy_nodes(const bn_response_msg *msg, bn_response_msg *out) {

@@ -188,6 +188,8 @@ lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg) {
     return send_message<request_kind>(session, msg);
 }
 lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg) {
+    CHECK_NULL(session);
+    const gcl_session_guard guard(session); // nothing gets between an answer and its refusal
     const lc_status status = send_message<response_kind>(session, msg);
     if (status != LC_NO_BUFFER_SPACE && status != LC_CANCELLED)
         return status;

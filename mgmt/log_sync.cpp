@@ -100,7 +100,6 @@ lc_status qv_read_log_facility(mdc *session, uint32_t *out_facility) {
 namespace {
 
 // --- A change event
-// -------------------------------------------------------------------------------------------------
 
 lc_status value_text(const bn_binding *binding, owned_tstring *out) {
     CHECK_STATUS(bn_binding_get_tstr(binding, bn_attrib_value, 0, nullptr, &out->pointer));
@@ -190,7 +189,6 @@ lc_status qv_handle_log_level_change(const bn_binding_array *bindings) {
 }
 
 // --- Time zone
-// ------------------------------------------------------------------------------------------------------
 
 lc_status qv_register_time_zone_change(mdc *session) {
     CHECK_STATUS(mdc_send_action_with_bindings_str_va(session, nullptr, nullptr, ACTION_ADD_INTEREST, 1,

@@ -13,8 +13,11 @@
 #include "runtime/logging.h"
 
 constexpr const char *WILDCARD = "*";
-// The tree is walked and freed by recursion, and its names come from a peer: a deeper one is not registered.
+// The tree is walked and freed by recursion, and its names come from a peer: a name of more parts is not
+// registered.
 constexpr uint32_t REGISTERED_PARTS_MAX = 64;
+// Of all names together. A node of the tree takes far more memory than a part takes in a message.
+constexpr uint32_t REGISTERED_TOTAL_MAX = 4096;
 
 // --- Registered nodes
 
@@ -209,7 +212,8 @@ static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array 
 
 // --- The query
 
-static lc_status add_registration(tree *registered, const bn_binding *binding) {
+// `inout_total`: the parts of the names so far.
+static lc_status add_registration(tree *registered, const bn_binding *binding, uint32_t *inout_total) {
     const bn_attrib *attribute = nullptr;
     CHECK_STATUS(bn_binding_get_attrib(binding, bn_attrib_capability_mask, &attribute));
     CHECK_NULL(attribute);
@@ -221,8 +225,17 @@ static lc_status add_registration(tree *registered, const bn_binding *binding) {
     }
     const tstr_array *parts = nullptr;
     CHECK_STATUS(bn_binding_get_name_parts_const(binding, &parts, nullptr));
-    if (tstr_array_length_quick(parts) > REGISTERED_PARTS_MAX) {
-        LC_LOG(LC_LOG_ERR, "Registered name of %u parts ignored", tstr_array_length_quick(parts));
+    const uint32_t count = tstr_array_length_quick(parts);
+    if (count > REGISTERED_PARTS_MAX) {
+        LC_LOG(LC_LOG_ERR, "Registered name of %u parts ignored", count);
+        return LC_OK;
+    }
+    if (*inout_total > REGISTERED_TOTAL_MAX)
+        return LC_OK;
+    *inout_total += count;
+    if (*inout_total > REGISTERED_TOTAL_MAX) {
+        LC_LOG(LC_LOG_ERR, "Registered names of more than %u parts, ignored from %s on", REGISTERED_TOTAL_MAX,
+               bn_binding_get_name_quick(binding));
         return LC_OK;
     }
     owned_reg record;
@@ -233,11 +246,19 @@ static lc_status add_registration(tree *registered, const bn_binding *binding) {
 
 static lc_status answer_node(const mon_walk *walk, const bn_node_info *info, const bn_binding *binding) {
     const char *name = bn_binding_get_name_quick(binding);
+    const tstr_array *known = nullptr;
+    CHECK_STATUS(bn_binding_get_name_parts_const(binding, &known, nullptr));
+    // A copy of the parts takes many times the bytes of the name, which a peer chooses. The walk changes
+    // them, and a name that is too long to be registered is in no tree.
     owned_tstr_array parts;
-    CHECK_STATUS(bn_binding_get_name_parts(binding, &parts.pointer));
+    const bool walked = info->subop == bn_query_iterate;
+    if (walked && tstr_array_length_quick(known) > REGISTERED_PARTS_MAX)
+        return LC_OK;
+    if (walked || !known)
+        CHECK_STATUS(bn_binding_get_name_parts(binding, &parts.pointer));
     switch (info->subop) {
     case bn_query_get:
-        CHECK_STATUS(get_node(walk, name, parts.pointer));
+        CHECK_STATUS(get_node(walk, name, known ? known : parts.pointer));
         return LC_OK;
     case bn_query_iterate:
         CHECK_STATUS(mdc_mon_iterate_node_internal(walk, parts.pointer, 0));
@@ -295,10 +316,11 @@ lc_status mdc_dispatch_mon_request(gcl_session *session, bn_request_msg *request
     options.name_to_parts = bn_binding_name_to_parts;
     owned<tree, free_tree> registered;
     CHECK_STATUS(tree_new(&registered.pointer, &options));
+    uint32_t registered_parts = 0;
     for (uint32_t i = 0; i < count; i++)
         if (info.pointer[i].subop == bn_query_registration_info)
-            CHECK_STATUS(
-                add_registration(registered.pointer, bn_binding_array_get_quick(bindings.pointer, i)));
+            CHECK_STATUS(add_registration(registered.pointer, bn_binding_array_get_quick(bindings.pointer, i),
+                                          &registered_parts));
     mon_answer answer = {};
     for (uint32_t i = 0; i < count && !answer.too_large; i++) {
         if (info.pointer[i].subop == bn_query_registration_info)

@@ -318,13 +318,20 @@ TEST(client, monitoring_answers) {
         deep += "/d";
     monitored several;
     several.add_registered({deep, deep + "/e"});
+    several.add_registered(strings(63, deep));
+    several.add_registered({"/late", "/later"}); // beyond the bound on all of them
     several.add_node("/odd", bn_query_none);
     several.add_node(deep, bn_query_iterate, bn_qf_include_self);
+    several.add_node(deep + "/e", bn_query_iterate, bn_qf_include_self);
+    several.add_node("/late", bn_query_iterate, bn_qf_include_self);
     several.add_node("/one", bn_query_get);
     ASSERT_EQ(several.dispatch(), 0);
-    EXPECT_EQ(several.answer(), (strings{deep + " 1003", "/one 1004"}));
+    EXPECT_EQ(several.answer(), (strings{deep + " 1068", "/one 1071"}));
     const std::string lines = log.take();
     EXPECT_NE(lines.find("Registered name of 65 parts ignored"), std::string::npos);
+    EXPECT_NE(lines.find("Registered names of more than 4096 parts, ignored from /late on"),
+              std::string::npos);
+    EXPECT_EQ(lines.find("/later"), std::string::npos);
     EXPECT_NE(lines.find("Unexpected query subop 0; ignoring request for binding /odd"), std::string::npos);
 
     for (const lc_status status : {LC_NULL, LC_ASSERTION, LC_BAD_TYPE}) { // and no answer goes
