@@ -434,11 +434,14 @@ lc_status mdc_event_config_change_notif_extract(bn_binding_array *bindings, bn_b
         CHECK_STATUS(bn_binding_array_new(&new_values.pointer));
     CHECK_STATUS(bn_binding_array_sort(bindings));
     const uint32_t count = bn_binding_array_length_quick(bindings);
+    const char *before = nullptr;
     for (uint32_t i = 0; i < count; i++) {
         const bn_binding *binding = bn_binding_array_get_quick(bindings, i);
         const char *name = binding ? bn_binding_get_name_quick(binding) : nullptr;
-        if (!name)
+        // Each entry copies its values: the same one again and again would take any amount of memory.
+        if (!name || (before && strcmp(before, name) == 0))
             continue;
+        before = name;
         owned_tstr_array parts;
         int absolute = 0;
         CHECK_STATUS(bn_binding_name_to_parts(name, &parts.pointer, &absolute));
