@@ -10,10 +10,11 @@
 // anything else ends the session. Even then memory is taken for what has come, 64 KiB at a time, never for
 // what was announced.
 //
-// The output queue is bounded in bytes. A frame that would go past the bound is not taken; the first one is
-// told in the log, the rest of that filling counted and told when the queue has drained to half. The frame's
-// sender gets LC_CANCELLED: nothing waits for an answer to a frame that never went, and nothing writes a line
-// for each. An answer that is not taken is replaced by a refusal, for which the queue keeps a reserve.
+// The output queue is bounded in bytes. A frame that would exceed the bound is not taken. The first such
+// frame is logged; the following ones are counted, and their number is logged when the queue has drained to
+// half. The sender gets LC_CANCELLED, so that it does not wait for an answer to a frame that was never sent,
+// nor log a line of its own. An answer that is not taken is replaced by a refusal, for which the queue keeps
+// a reserve.
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
