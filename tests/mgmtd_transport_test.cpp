@@ -3,9 +3,11 @@
 #include <fstream>
 
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 
 #include "peers/mgmtd/transport.h"
+#include "runtime/ttime.h"
 #include "tests/support/gcl_provider.h" // wire, be, padded, frame_bytes, number_at
 
 namespace {
@@ -243,6 +245,25 @@ TEST_F(Transport, ClientsThatCrowdLeaveTheDaemonsTheirPlaces) {
     now += OPENING_MAX_MS;
     pump();
     EXPECT_EQ(sockets.sessions.size(), CLIENT_SESSIONS_MAX + 2) << "those that never greeted are gone";
+
+    // Without descriptors a connection waits, and costs no more than a look each second.
+    raw_client waiting;
+    rlimit limit;
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &limit), 0);
+    const rlimit few = {150, limit.rlim_max}; // poll wants the limit above the number of its descriptors
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &few), 0);
+    std::vector<int> fillers;
+    for (int fd; (fd = dup(STDERR_FILENO)) >= 0;)
+        fillers.push_back(fd);
+    round();
+    const int64_t began = lt_monotonic_ms();
+    round();
+    EXPECT_GE(lt_monotonic_ms() - began, 4) << "the round waits";
+    for (const int fd : fillers)
+        close(fd);
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &limit), 0);
+    now += ACCEPT_PAUSE_MS;
+    open(&waiting, "wccpd-4");
 }
 
 TEST_F(Transport, TheSocketIsOursAlone) {

@@ -292,8 +292,12 @@ static bool make_room(transport *self) {
 
 static void accept_session(transport *self) {
     const int fd = accept4(self->place.socket, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
-    if (fd < 0)
+    if (fd < 0) {
+        // The connection still waits, and would end each poll at once.
+        if (errno != EAGAIN && errno != EINTR && errno != ECONNABORTED)
+            self->accept_at_ms = self->owner->now_ms() + ACCEPT_PAUSE_MS;
         return;
+    }
     listener_tidy(&self->place);
     ucred credentials{};
     socklen_t length = sizeof credentials;
@@ -338,6 +342,8 @@ static int64_t run_timers(transport *self, int64_t timeout_ms) {
         self->check_place_at_ms = now + LISTENER_CHECK_MS;
     }
     int64_t next = self->check_place_at_ms;
+    if (now < self->accept_at_ms)
+        next = std::min(next, self->accept_at_ms);
     for (auto &[id, client] : self->sessions) {
         if (client.stage == session::open)
             continue;
@@ -356,7 +362,8 @@ void transport_round(transport *self, std::vector<pollfd> *inout_others, int64_t
     sweep(self);
     std::vector<pollfd> watched = *inout_others;
     const size_t others = watched.size();
-    watched.push_back({self->place.socket, POLLIN, 0});
+    const bool accepts = self->owner->now_ms() >= self->accept_at_ms;
+    watched.push_back({accepts ? self->place.socket : -1, POLLIN, 0});
     std::vector<uint32_t> ids;
     for (const auto &[id, client] : self->sessions) {
         watched.push_back({client.fd, static_cast<short>(POLLIN | (client.queue.empty() ? 0 : POLLOUT)), 0});

@@ -19,6 +19,7 @@ constexpr size_t QUEUE_MAX_BYTES = 32u << 20;
 constexpr uint32_t OPENING_FRAME_MAX = 4096; // before the service is open
 constexpr int64_t OPENING_MAX_MS = 10000;    // from the connection until the service is open
 constexpr int64_t LISTENER_CHECK_MS = 2000;
+constexpr int64_t ACCEPT_PAUSE_MS = 1000; // when there is no descriptor for a connection that waits
 
 struct session {
     int fd;
@@ -37,6 +38,7 @@ struct transport {
     server *owner = nullptr;
     listener place;
     int64_t check_place_at_ms = 0;
+    int64_t accept_at_ms = 0; // no connection is accepted before
     std::map<uint32_t, session> sessions;
     uint32_t next_id = 1;
     uint32_t admin_messages = 0;
