@@ -71,7 +71,7 @@ lab_enter() { # SCRIPT ARGUMENTS...
     [ "$(id -u)" = 0 ] || user=(--user --map-root-user)
     # The holder dies with this shell (pdeathsig), and everything with the holder (--kill-child). Started in the
     # background, because a shell runs its traps only then; job control gives neither terminal nor signals away.
-    LAB_INSIDE=1 setpriv --pdeathsig KILL bash -c '[ $PPID = "$0" ] && exec "$@"' $$ \
+    LAB_INSIDE=1 setpriv --pdeathsig KILL bash -c '[ $PPID = "$0" ] && LAB_HOLDER=$$ exec "$@"' $$ \
         env --default-signal=INT,QUIT unshare "${user[@]}" --mount --net --pid --fork --kill-child \
         --propagation private bash "$script" "$@" <&0 &
     local holder=$! status
@@ -87,6 +87,9 @@ lab_enter() { # SCRIPT ARGUMENTS...
 # ---- the inner side
 
 lab_set_up() {
+    # A holder that was killed just after its fork could not yet arrange that this shell dies with it. /proc still
+    # shows the processes outside.
+    grep -qs '^State:[[:space:]]*[^ZX]' "/proc/$LAB_HOLDER/status" || exit 1
     mount -t proc proc /proc || lab_die "no /proc of our own"
     local aside
     for aside in /media /srv /mnt /opt; do
@@ -242,6 +245,12 @@ lab_stop() { # NODE NAME [SIGNAL]
         sleep 0.05
     done
     return 124
+}
+# After kill -STOP of lab_pid. nsenter has stopped itself with the program, and continues it when it is continued. A
+# SIGCONT that came later, while the program ends under the leak checker, would take back the checker's SIGSTOP.
+lab_continue() { # NODE NAME
+    kill -s CONT "${LAB_PID[$1/$2]}"
+    lab_wait_line 5 '^State:[[:space:]]*[^T]' "/proc/$(lab_pid "$1" "$2")/status"
 }
 lab_expect_sockets() { # NODE NAME PID
     local own

@@ -112,7 +112,7 @@ case_hung_while_tunnels_go() {
     for i in {1..32}; do
         router_at_is r1 "10.0.0.$i" 5 $((51 + (i - 1) / 8)) '.counters.rx_shutdown == 1'
     done
-    kill -CONT "$(lab_pid a1 tunneld)"
+    lab_continue a1 tunneld || die "tunneld does not continue"
     finish a1
 }
 # mgmtd keeps both: a crash of tunneld ends wccpd in order, and all of it comes back with tunnels of its own.
