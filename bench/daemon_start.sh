@@ -4,7 +4,7 @@
 # by room, once all groups are assigned.
 #
 # The time is that of the clock and, since the machine may be busy, the processor time of the daemon and of mgmtd.
-# What one group costs is told against what it costs at the first number above 1: a start that looks at every node
+# The cost of one group is compared with the cost at the first number above 1: a start that looks at every node
 # for every node would show there.
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)

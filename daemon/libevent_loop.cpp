@@ -28,7 +28,7 @@
 // The escape flag is never cleared. Each round looks at it first, and again after each callback.
 //
 // poll is the mechanism, not epoll: a descriptor that was closed under its event then shows as readable and
-// writable, in the place of vanishing without a sign.
+// writable, instead of vanishing silently.
 #include "daemon/libevent_loop.h"
 
 #include <algorithm>

@@ -11,7 +11,7 @@
 // needs the session, and the alarm session must exist before the engine can raise anything. m_daemon_status
 // alone says how far the start has come. Until it is WCCPD_READY, queries are dropped and changes of the
 // configuration are kept (wccpd_early_changes.h). A start that fails does not end the process, which sits in
-// its loop, never ready and deaf to changes, until a signal comes.
+// its loop, never ready and ignoring changes, until a signal arrives.
 //
 // The order of the exit: alarms are cleared while their session is open; then that session and its thread
 // end, the signal registrations are removed, the working session is closed, and the mailbox is reset. Groups
@@ -24,8 +24,8 @@
 //
 // All memory is locked, so every mapped page counts, read or not: threads have small stacks
 // (engine/cthread.cpp), malloc one arena and no memory for what large buffers needed once, received bindings
-// no second copy of their names. scripts/memory.sh tells what is locked, by room; bench/daemon_start.sh at
-// full size.
+// no second copy of their names. scripts/memory.sh shows what is locked, by component; bench/daemon_start.sh
+// at full size.
 #include "daemon/wccpd_main.h"
 
 #include <cerrno>

@@ -2,7 +2,7 @@
 // names.
 //
 // Nothing is cached. Each request goes to the engine's queries, which take the engine lock for their own
-// length, and the answer is rendered here: every node is a row that tells what it is asked of and how its
+// length, and the answer is rendered here: every node is a row that says what it is asked of and how its
 // value is written. The text nodes carry the engine's dumps in buffers that live for the one request.
 //
 // Main thread only, and only once the daemon is ready. Router and appliance numbers are places in a list at
@@ -160,7 +160,7 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
     subject->group = static_cast<uint8_t>(number_part(subject, GROUP_PART));
     const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
     const int group = static_cast<int>(group_text ? strtol(group_text, nullptr, 10) : 0);
-    // The parents themselves count as well: a get of one finds no number behind it.
+    // The parents themselves count as well: a get of one finds no number after it.
     snprintf(routers, sizeof routers, "%s/%d/router", NODE_GROUP_STATE, group);
     snprintf(appliances, sizeof appliances, "%s/%d/appliance", NODE_GROUP_STATE, group);
     if (!lc_is_prefix(routers, subject->name, 0)) {

@@ -1,7 +1,7 @@
 // Named threads.
 //
 // A context belongs to whoever made it until cthread_join frees it. While its thread may still have to be
-// ended it stands on the process's thread list, which has a mutex of its own; that mutex is a leaf, and is
+// ended it is on the process's thread list, which has a mutex of its own; that mutex is a leaf, and is
 // not held while a thread is waited for.
 //
 // Signals: every thread made here is born with all signals blocked, so a signal to the process always goes to

@@ -7,7 +7,7 @@
 
 #include <pthread.h>
 
-// A packet, the log buffers and what stands between them; the sanitizers need more.
+// A packet, the log buffers and what lies between them; the sanitizers need more.
 #ifdef WCCP_SANITIZED
 constexpr size_t CTHREAD_STACK_BYTES = 512 * 1024;
 #else

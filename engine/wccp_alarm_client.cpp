@@ -121,7 +121,7 @@ static lc_status start_session(const char *client_name) {
     return LC_OK;
 }
 
-// Tells the main thread, which may be waiting in its loop; the work itself is nothing.
+// Wakes the main thread, which may be waiting in its loop; the posted work itself does nothing.
 static void tell_started() {
     static loop_post wake = {nullptr, nullptr, [](loop_post *, int) {}};
     loop_context *main_loop = nullptr;

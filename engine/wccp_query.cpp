@@ -13,7 +13,7 @@ static void put_text(char (&field)[Size], const char *text) {
     strlcpy(field, text, Size);
 }
 
-// Value to word; a value behind the table is "unknown".
+// Value to word; a value past the table is "unknown".
 template <size_t Count>
 static const char *word_of(const char *const (&words)[Count], uint32_t value) {
     return value < Count ? words[value] : "unknown";

@@ -198,7 +198,7 @@ lc_status bn_query_request_msg_append_str(bn_request_msg *msg, uint32_t subop, u
     return LC_OK;
 }
 
-// A value-less attribute stands for each one that is asked for.
+// An attribute without a value for each one that is asked for.
 static lc_status ask_for_attributes(bn_binding *binding, const bn_attrib_array *attributes) {
     const uint32_t count = bn_attrib_array_length_quick(attributes);
     for (uint32_t id = 0; id < count; id++)

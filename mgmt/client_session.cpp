@@ -16,7 +16,7 @@ lc_status mgmt_client_init(mgmt_client *client, fdic_handler close_handler) {
     return LC_OK;
 }
 
-// 14014 and 14016 only say that nobody is there, which the caller tells in words of its own.
+// 14014 and 14016 only say that nobody is there, which the caller logs in its own words.
 static lc_status connect_quietly(gcl_session *session) {
     const lc_status status = gcl_session_client_connect_by_provider(session, "mgmtd", 1);
     if (status == LC_IO_ERROR || status == LC_IO_CLOSED)

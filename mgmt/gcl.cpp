@@ -122,7 +122,7 @@ lc_status gcl_shutdown(gcl *instance) {
     CHECK_NULL(instance);
     const gcl_instance_guard guard(instance);
     lc_status result = LC_OK;
-    // A close tells its handler, which may do anything: the list is walked from its start after each.
+    // A close calls its handler, which may do anything: the list is walked from its start after each.
     for (gcl_session *session = instance->sessions; session;) {
         if (session->state == GCL_SESSION_CLOSED) {
             session = session->next;

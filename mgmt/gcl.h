@@ -79,7 +79,7 @@ lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int st
                                      int stop_on_frames_received, int stop_on_session_state,
                                      int stop_on_protocol_state, uint16_t protocol, int64_t timeout_ms);
 // A frame of more than GCL_FRAME_MAX gives LC_NO_BUFFER_SPACE, with a line. A full output queue gives
-// LC_CANCELLED; one line of the log stands for all frames lost in one filling.
+// LC_CANCELLED; one line is logged for all frames lost while the queue is full.
 lc_status gcl_session_send_frame_components(gcl_session *session, uint16_t proto, uint16_t mtype,
                                             uint32_t length, const void *body);
 // The buffer has room for the header at its start; it is taken over, also on failure.

@@ -334,7 +334,7 @@ static void drop_interests(gcl_session *session) {
     session->rate_timer = session->fd_interest = -1;
     if (timer >= 0)
         LOG_STATUS(fdic_event_delete_timer(interests, timer));
-    if (descriptor >= 0) // tells the close handler, so nothing follows it
+    if (descriptor >= 0) // calls the close handler, therefore nothing follows it
         LOG_STATUS(fdic_event_delete_fd(interests, descriptor));
 }
 

@@ -34,7 +34,7 @@ static_assert(offsetof(gcl_wire_header, total_length) == 12 &&
 static_assert(offsetof(gcl_wire_header, sequence) == 20 && offsetof(gcl_wire_header, proto) == 24);
 static_assert(offsetof(gcl_wire_header, mtype) == 26 && offsetof(gcl_wire_header, body_length) == 28);
 
-// The same header in host order, as a frame stands in memory before it is sent and after it was read.
+// The same header in host order, as a frame lies in memory before it is sent and after it was read.
 struct gcl_frame_header {
     char ident[4];
     uint32_t marker;

@@ -1,4 +1,4 @@
-// The thin layer with which a daemon asks mgmtd for values and tells it things, without handling messages
+// The thin layer with which a daemon queries mgmtd and reports to it, without handling messages
 // itself.
 //
 // It doesn't touch the session: sending and waiting are done by the send function that the daemon gives to

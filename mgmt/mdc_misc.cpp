@@ -2,7 +2,7 @@
 //
 // A monitoring query brings the daemon's registered nodes along as "registration_info" nodes. They make a
 // tree for the length of the query, with the capability mask as each node's value; it decides which names can
-// be walked. A registered wildcard is walked by asking the daemon for the children that stand behind it.
+// be walked. A registered wildcard is walked by asking the daemon for the children that it matches.
 #include <cstdlib>
 #include <cstring>
 

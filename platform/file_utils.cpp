@@ -1,10 +1,10 @@
-// Two file operations that must hold against whatever stands at the path already.
+// Two file operations that must be safe whatever is at the path already.
 //
 // A file is written beside its place under a name of its own and then moved there in one step, so that a
-// reader sees the old bytes or the new ones, and a write that fails (a full disk) loses nothing. What stands
-// at the path is looked at first; a link put there after the look is replaced, never followed.
+// reader sees the old bytes or the new ones, and a write that fails (a full disk) loses nothing. What is at
+// the path is checked first; a link put there after the look is replaced, never followed.
 //
-// errno tells the reason of a failure when these return, whatever the log did in between. Each runs with
+// errno has the reason of a failure when these return, whatever the log did in between. Each runs with
 // cancellation off: it holds descriptors, and it is short.
 
 #include "platform/file_utils.h"

@@ -39,7 +39,7 @@ static const char *skip_blanks(const char *text) {
     return text;
 }
 
-// Takes one line over, or tells that it can't be one of ours.
+// Reads one line; false when it cannot be one of ours.
 static bool take_line(const char *line, platform_limits *limits) {
     const char *at = skip_blanks(line);
     if (*at == '\0' || *at == '#')

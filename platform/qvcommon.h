@@ -1,6 +1,6 @@
 // libqvcommondyn.so, the platform's closed library: interface socket, link and address notifications, address
-// text, state events. What stands here is all that the daemon passes and relies on, so that another library
-// of that name may take the place of ours.
+// text, state events. The daemon relies on nothing but what is declared here, so that another library of that
+// name can replace ours.
 #pragma once
 
 #include <cstddef>

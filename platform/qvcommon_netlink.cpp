@@ -5,20 +5,20 @@
 // interfaces by index and the socket that hears the kernel's notifications. It blocks every signal, and
 // sleeps until the kernel says something.
 //
-// What a program is told. A link state event is a change of an interface's name, administrative state or
-// operational state (IFF_UP, IFF_RUNNING); a notification that changes none of these is no event. An address
-// event is any notification about an IPv4 address of the interface. A name that goes (deleted, renamed, moved
-// to another namespace) is told as down, with an address event behind it, before a name that comes is told,
-// unless another interface has it by then. When a kind starts, every interface is told, so that a change
-// between the caller's own look and the start isn't lost.
+// Events. A link state event is a change of an interface's name, administrative state or operational state
+// (IFF_UP, IFF_RUNNING); a notification that changes none of these is not an event. An address event is any
+// notification about an IPv4 address of the interface. A name that disappears (deleted, renamed, moved to
+// another namespace) is reported as down, followed by an address event, before a new name is reported, unless
+// another interface has the name by then. When a kind starts, every interface is reported, so that no change
+// between the caller's own look and the start is lost.
 //
 // Looks. When a kind starts, when the kernel's queue has overrun (a storm, or a callback that took long), or
 // when a notification names an interface that is not known, nothing that is queued can be trusted: what is
 // older than the look would undo what the look has found. The queue is therefore emptied first. That drops
-// notifications of every kind, so then every interface is asked for, and each started kind is told of each of
-// them, changed or not. What vanished is told as down, and a name that now belongs to another interface is
-// told as down and again as it is. Notifications that come during the look are read after it, and end in the
-// latest state. A look that fails is tried again a little later.
+// notifications of every kind; therefore all interfaces are queried, and each started kind reports every one
+// of them, changed or not. An interface that is gone is reported as down, and a name that now belongs to
+// another interface is reported as down and then as it is. Notifications that arrive during the look are read
+// after it and lead to the latest state. A look that fails is repeated a little later.
 //
 // The process may be in exit() while this thread runs. Hence no object here has a destructor, and of libnl
 // only the core is used, whose code has none either; libnl-route's objects hang from tables that its
@@ -134,8 +134,7 @@ bool read_link(nlmsghdr *header, interface *out) {
     if (nlmsg_parse(header, sizeof(ifinfomsg), attributes, IFLA_MAX, nullptr) < 0)
         return false;
     const auto *link = static_cast<const ifinfomsg *>(nlmsg_data(header));
-    // A bridge tells of its ports in messages of its own family; a port that leaves is not an interface that
-    // goes.
+    // A bridge reports its ports in messages of its own family; a port that leaves the bridge still exists.
     if (link->ifi_family != AF_UNSPEC || !attributes[IFLA_IFNAME])
         return false;
     *out = {};
@@ -153,7 +152,7 @@ void want_look() {
 void link_is(const interface *now) {
     interface *holder = find_name(&known, now->name);
     if (holder && holder->index != now->index)
-        holder->name[0] = '\0'; // the message that tells where it went is still to come
+        holder->name[0] = '\0'; // its own message is still to come
     interface *before = find_index(&known, now->index);
     if (!before) {
         if (!append(&known, now))

@@ -1,4 +1,4 @@
-// The netlink side of libqvcommondyn.so, for its other file only: what is exported stands in qvcommon.h.
+// The netlink side of libqvcommondyn.so, for its other file only: qvcommon.h has what is exported.
 #pragma once
 
 #include <cstdint>

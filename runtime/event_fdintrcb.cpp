@@ -6,8 +6,8 @@
 // full, empty again, or closed by the peer) is copied and posted to the loop; entries, loop events and the
 // open and close handlers are dealt with there, before the loop runs its next callback and in the order of
 // the changes. The poster waits for nothing, so it may hold the locks that a callback of the loop wants, and
-// an entry never goes while the loop's thread stands in its handler. On its own thread a change is carried
-// out at once, behind what is posted.
+// an entry is never freed while the loop's thread is in its handler. On its own thread a change is carried
+// out at once, after what is posted.
 //
 // A handler works on a copy of its entry all the same: the interest's function may take its own interest
 // away.

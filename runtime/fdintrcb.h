@@ -1,5 +1,5 @@
-// Interest lists: what a library wants to be told about descriptors and timers, told to whatever loop stands
-// behind the list by one change callback. A list has no lock of its own; its user's lock guards it.
+// Interest lists: the descriptors and timers that a library wants to hear about. One change callback passes
+// them to the loop that serves the list. A list has no lock of its own; its user's lock guards it.
 #pragma once
 
 #include <cstdint>

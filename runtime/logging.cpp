@@ -11,7 +11,7 @@
 // process ends: a thread that logs after lc_log_close finds no state under it and its line is dropped. What
 // the log itself calls under its lock may meet a failure and want to log that; such a line is dropped too.
 //
-// The caller's format is pasted behind the line's own head and used once: the head holds no "%". A format
+// The caller's format is appended to the line's own head and used once: the head holds no "%". A format
 // that had to be cut is cut ahead of a conversion that it would end in.
 #include "runtime/logging_levels.h"
 

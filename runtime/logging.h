@@ -1,5 +1,5 @@
 // The one logging entry point of the process, its levels and its state. Lines go to the log daemon's socket
-// without ever blocking the caller for long; the story stands in logging.cpp.
+// without ever blocking the caller for long; logging.cpp explains how.
 #pragma once
 
 #include <atomic>
@@ -55,7 +55,7 @@ constexpr const char *LC_LOG_FACILITY_FILE = "/var/opt/rvl/syslog_fac.conf";
 
 // True when a line of this level would be written: the test that every statement makes first.
 inline bool lc_log_check_level(int32_t level) {
-    // NOLINTNEXTLINE(bugprone-signed-char-misuse): the sign is what tells "none"
+    // NOLINTNEXTLINE(bugprone-signed-char-misuse): the sign means "none"
     const int32_t own = G_daemon_log_level.load(std::memory_order_relaxed);
     return (own != -1 ? own : G_log_level.load(std::memory_order_relaxed)) >= level;
 }

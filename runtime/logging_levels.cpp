@@ -201,7 +201,7 @@ lc_status lc_log_enable_override_log_level(int32_t system_wide, int32_t enable) 
     return LC_OK;
 }
 
-// A level of -1 stands for the system level. An override that ends so no longer counts.
+// A level of -1 means the system level. An override that ends so no longer counts.
 static lc_status set_override_level(int32_t level) {
     const locked_state log;
     if (!log.state)

@@ -5,13 +5,13 @@
 // whole and in order. Once the patience is used up a line is tried and given up at once, until one gets
 // through, which restores it.
 //
-// The wait is made of short steps with a try after each: the kernel tells that a socket has room only when
-// half of its send buffer is free, which a slow daemon may take long for, while a line fits much earlier.
+// The wait consists of short steps with a try after each: poll() reports room only when half of the socket's
+// send buffer is free. A slow daemon may take long for that, while a line fits much earlier.
 //
-// A daemon that goes takes its socket along: the next line connects again. One that stands still while
-// another takes over its path is noticed by the socket file when a line would be lost. Without /dev/log lines
-// are lost quietly, at the price of a look at the path. As in the C library, a /dev/log that is a stream gets
-// each line with its NUL.
+// When the daemon ends, its socket ends too, and the next line connects again. A daemon that has stopped
+// while another one took over its path is noticed by the socket file when a line would be lost. Without
+// /dev/log lines are lost quietly, at the price of a look at the path. As in the C library, a /dev/log that
+// is a stream gets each line with its NUL.
 //
 // One line is made in a buffer of this file, under the log's lock; only a line that is longer allocates.
 #include "runtime/syslog_socket.h"
@@ -39,7 +39,7 @@ constexpr size_t LINE_BYTES = 4096;
 constexpr int64_t WAIT_STEP_NS = 500000;
 constexpr int64_t LEAST_STEP_NS = 1000; // a wait that finds room each time and no place in it ends as well
 
-// The C library's own mask stands behind a lock which another thread's blocked syslog call may hold.
+// The C library's own mask is guarded by a lock that another thread's blocked syslog call may hold.
 static std::atomic<int32_t> mask{0xff};
 
 void syslog_set_mask(int32_t level) {
@@ -144,7 +144,7 @@ static int send_line(syslog_socket *log, const char *line, size_t length) {
         }
         if (result == EAGAIN && !path_is_anothers(log))
             return result;
-        syslog_socket_close(log); // the daemon has gone; perhaps another stands in its place
+        syslog_socket_close(log); // the daemon has ended; another may listen at its path
         failures++;
     }
     return result;

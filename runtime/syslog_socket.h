@@ -30,5 +30,5 @@ int syslog_socket_vsend(syslog_socket *log, int32_t level, const char *format, v
 int syslog_socket_send(syslog_socket *log, int32_t level, const char *format, ...)
     __attribute__((format(printf, 3, 4)));
 
-// Passes levels up to this one: bit n of the mask stands for level n.
+// Passes levels up to this one: bit n of the mask is level n.
 void syslog_set_mask(int32_t level);

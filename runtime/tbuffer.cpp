@@ -1,4 +1,4 @@
-// Growable byte buffers. One byte more than `size` is allocated, so that the NUL behind the last byte has its
+// Growable byte buffers. One byte more than `size` is allocated, so that the NUL after the last byte has its
 // place in a full buffer; fresh memory is zero, so that a length set over it shows zero bytes and never what
 // lay there before. Counts that a reader takes from the bytes are bounded by the bytes that follow them.
 #include "runtime/tbuffer.h"

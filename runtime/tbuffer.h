@@ -1,4 +1,4 @@
-// A growable buffer of bytes, for frames. A NUL stands behind the last byte. Readers check against the
+// A growable buffer of bytes, for frames. A NUL follows the last byte. Readers check against the
 // length: a number past the end gives LC_ASSERTION, a string LC_NO_BUFFER_SPACE.
 #pragma once
 
@@ -68,7 +68,7 @@ lc_status tb_get_uint32(const tbuffer *buffer, uint32_t offset, uint32_t *out);
 lc_status tb_get_uint64(const tbuffer *buffer, uint32_t offset, uint64_t *out);
 lc_status tb_get_uint128(const tbuffer *buffer, uint32_t offset, uint8_t out[16]);
 
-// A string with an optional 4-byte length word, which counts the NUL when one is added and stands in network
+// A string with an optional 4-byte length word, which counts the NUL when one is added and is in network
 // order with `swap`. `length` -1 is strlen. Outs may be null; `out_written` and `out_used` count all bytes.
 lc_status tb_put_str(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
                      const char *text, int32_t length, uint32_t *out_written);

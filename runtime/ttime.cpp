@@ -310,7 +310,7 @@ LT_FROM_STR(datetime, sec, lt_time_sec)
 LT_FROM_STR(dur, ms, lt_dur_ms)
 LT_FROM_STR(dur, sec, lt_dur_sec)
 
-// A zone that doesn't exist, then none: the second tzset behind localtime cannot take the first for the same.
+// A zone that doesn't exist, then none: the second tzset after localtime cannot take the first for the same.
 lc_status lt_timezone_handle_changed() {
     const lc_status status = lc_setenv("TZ", "error", 1);
     tzset();

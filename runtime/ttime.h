@@ -22,7 +22,7 @@ lt_time_sec lt_curr_time();
 lt_time_ms lt_curr_time_ms();
 lt_time_us lt_curr_time_us();
 
-// The clock that nobody sets (CLOCK_MONOTONIC), for time-outs and durations. It stands still while the
+// The clock that nobody sets (CLOCK_MONOTONIC), for time-outs and durations. It stops while the
 // machine is suspended.
 int64_t lt_monotonic_ms();
 int64_t lt_monotonic_ns();
@@ -37,7 +37,7 @@ lt_time_sec lt_timeval_to_time_sec(const timeval *value);
 lt_time_ms lt_timeval_to_time_ms(const timeval *value);
 
 // Value to text. LC_ASSERTION when it doesn't fit; the _to_str forms allocate, the caller frees. Dates and
-// times of day are UTC, date-times are local, with "%z" behind them on request.
+// times of day are UTC, date-times are local, followed by "%z" on request.
 lc_status lt_date_to_buf(lt_date value, uint32_t size, char *buffer, uint32_t *out_length);
 lc_status lt_date_to_str(lt_date value, char **out);
 lc_status lt_daytime_sec_to_buf(lt_time_sec value, uint32_t size, char *buffer);

@@ -79,7 +79,7 @@ declare -A address=([r1]=10.0.0.1 [r2]=10.0.0.2 [a1]=10.0.0.101 [a2]=10.0.0.102)
 survivor=a2
 everyone="routers r1 ${address[r1]} r2 ${address[r2]}, appliances a1 ${address[a1]} a2 ${address[a2]}"
 
-# ---- what is told: lines with the time of the protocol's clock
+# ---- the output: lines with the time of the protocol's clock
 
 began_us=${EPOCHREALTIME/[.,]/}
 speed_milli=$(awk "BEGIN { printf \"%d\", $LAB_SPEED * 1000 }")

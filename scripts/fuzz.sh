@@ -1,6 +1,6 @@
 #!/bin/bash
 # fuzz.sh SECONDS [NAME...]: runs each fuzzer of fuzz/ (or those named) for so long, from its seeds in
-# fuzz/corpus/NAME/. Seeds are hexadecimal text with comments behind "#"; files of any other kind are taken as they
+# fuzz/corpus/NAME/. Seeds are hexadecimal text with comments after "#"; files of any other kind are taken as they
 # are. What a run finds beyond them stays in build/fuzz/corpus/ for the next one, an input that fails in
 # build/fuzz/failures/. Ends with 1 when one failed.
 set -u

@@ -3,7 +3,7 @@
 # each mapped page counts, also one that other processes have mapped as well.
 #
 # Rooms: the program and its libraries, with their constants and the libraries' own variables; stacks, that of the
-# main thread and those of the others, which are anonymous mappings right behind a guard page; heap, also where
+# main thread and those of the others, which are anonymous mappings right after a guard page; heap, also where
 # malloc took mappings of its own; shared blocks; tables, which are the program's own variables.
 set -eu
 awk '

@@ -37,7 +37,7 @@ expect "I-See-You" "wccp.message == 11" 20 400
 expect "Redirect-Assign" "wccp.message == 12" 10 100
 expect "Removal Query" "wccp.message == 13" 2 8
 
-# The picture stands below the demo's six rows; ^C comes when it does.
+# The snapshot is below the demo's six rows; ^C comes when it does.
 mark=demo-$$-$RANDOM
 coproc typist { until grep -aq 'wccpd Ready' "$scratch/screen" 2>/dev/null; do sleep 0.2; done; sleep 0.5; printf '\003'; sleep 5; }
 DEMO_MARK=$mark TERM=xterm timeout 60 script -qfec "stty rows 24 columns 80; exec '$top/scripts/demo.sh' --no-build" "$scratch/screen" \

@@ -2,7 +2,7 @@
 # The whole appliance: mgmtd, tunneld and wccpd, and one router. A group comes up from the configuration, a change of
 # its weight reaches the router, SIGTERM and the loss of mgmtd end the daemon in order; then mgmtd is killed at random
 # moments of the start.
-#   scenario_daemon.sh DIRECTORY_OF_THE_PROGRAMS        WCCP_STRESS=1: a hundred times in the place of five
+#   scenario_daemon.sh DIRECTORY_OF_THE_PROGRAMS        WCCP_STRESS=1: a hundred times instead of five
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
 export WCCP_BIN=${1:-$top/build/release/bin}
@@ -58,10 +58,10 @@ lab_wait_exit 10 a1 wccpd || fail "without mgmtd the daemon ended with $?"
 # The alarm session may be the first to notice, and then its thread ends by itself, at any place among the others.
 in_order "Lost connection to mgmtd; exiting" "qv_alm_thread: out of main loop, exiting..."
 in_order "Lost connection to mgmtd; exiting" "${last_steps[0]}" "${last_steps[1]}" "${last_steps[3]}" "${last_steps[@]:4}"
-# What a killed mgmtd has lost is told, and nothing else.
+# What a killed mgmtd has lost is reported, and nothing else.
 lab_clean_log a1 'Lost connection to mgmtd'
 
-# A daemon that has not reached mgmtd waits to be told; one that has a session ends with it.
+# A daemon that has not reached mgmtd waits for a signal; one that has a session ends with it.
 for ((round = 1; round <= rounds; round++)); do
     lab_mgmtd_start a1
     lab_start a1 wccpd wccpd

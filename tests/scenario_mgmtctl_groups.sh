@@ -81,7 +81,7 @@ printf '%s\n' 'assign_method = hash' 'hash_dst_ip = true' 'interface = eth0' 'pa
 shown '.groups[0] | .state == "ACTIVE" and .designated and (.routers | length == 2 and
     all(.connection == "two-way" and .shares["10.0.0.101"] == 100))'
 
-# A second appliance: the shares follow the weights, and every renderer tells of both.
+# A second appliance: the shares follow the weights, and every renderer shows both.
 lab_appliance_start a2 "$(lab_group 51 10.0.0.1 10.0.0.2 weight=300 assign_method=hash priority=10 password=secret hash_dst_ip=true)"
 shown '.groups[0].appliances | length == 2 and (map({(.address): .share_percent}) | add |
     .["10.0.0.101"] == 25 and .["10.0.0.102"] == 75) and all(.asked_percent == .share_percent)'

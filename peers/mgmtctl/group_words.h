@@ -8,7 +8,7 @@
 
 struct group_word {
     const char *word;
-    const char *node; // below the group's root; "router" stands for the list of its entries
+    const char *node; // below the group's root; "router" means the list of its entries
     const char *hint; // of its values; null: as the schema has them
     bool whole;       // wccpd takes a change only with the group as a whole
     bool free_text;   // any text is a value, "default" too

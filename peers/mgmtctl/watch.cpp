@@ -181,7 +181,7 @@ static std::vector<std::string> watched_events() {
     return out;
 }
 
-// A name without a wildcard stands for the node and all below it.
+// A name without a wildcard means the node and all below it.
 static std::string watch_pattern(const std::string &name) {
     if (name == "/")
         return "/**";

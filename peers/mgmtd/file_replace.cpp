@@ -51,7 +51,7 @@ static std::string directory_of(const std::string &path) {
     return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
 }
 
-// Where the file is, behind all links; the last of them may point to nothing yet.
+// Where the file is after all links are followed; the last of them may point to nothing yet.
 static bool follow_links(const std::string &path, std::string *out, std::string *out_reason) {
     *out = path;
     for (int i = 0; i < LINKS_MAX; i++) {

@@ -2,7 +2,7 @@
 // user that nobody else may write to. Root moves what somebody else put there out of the way, which the owner
 // cannot undo in a /tmp with the sticky bit. Other users leave it and report it.
 //
-// Two locks keep a second mgmtd off. The one on the directory also tells that a socket in it is left over
+// Two locks keep a second mgmtd off. The one on the directory also shows that a socket in it is left over
 // from an mgmtd that was killed, but it goes with the directory, which anything that cleans /tmp may remove.
 // Root's mgmtd therefore locks a file in /var/run as well. Both are held as long as the process lives.
 //
