@@ -47,7 +47,7 @@ double seconds_each(Work work) {
     return best;
 }
 
-// Runs the benchmark's loop, and tells how many floors one turn costs.
+// Runs the benchmark's loop, and reports how many floors one turn costs.
 template <typename Work>
 void run_against(benchmark::State &state, double floor, Work work) {
     G_log_level = LC_LOG_EMERG;

@@ -1,6 +1,6 @@
 // Received packets, from the header on, into a group that two routers already report to.
 //
-// An input is a mode byte and then packets, each behind two bytes: in their low 13 bits its length (the rest
+// An input is a mode byte and then packets, each after two bytes: in their low 13 bits its length (the rest
 // of the input, when there is less), in the high 3 bits how much time passes after it. The mode's bits are in
 // `mode` below. MENDED makes length, version, group and digest of each packet right before it is processed,
 // so that what is wrong further in is reached; without it they have to be found.

@@ -7,8 +7,8 @@
 // protocol: the time of day, by which the sessions with mgmtd limit their waiting and log lines are stamped;
 // and waits of up to LEAST_WAIT, of which some are counted until another process has answered.
 //
-// The real functions are found behind this library by name. They remain what waits, so that a thread can be
-// cancelled in them as ever.
+// The real functions are found by name in the libraries after this one. They remain what waits, so that a
+// thread can be cancelled in them as ever.
 #include <dlfcn.h>
 #include <poll.h>
 #include <sys/epoll.h>

@@ -6,8 +6,8 @@
 // pending the wait ends with LC_CANCELLED, and the loop that the caller goes back to takes it. A thread with
 // a loop of its own hears of the end from the one that takes the signals, by the `ending` of the instance.
 //
-// The interests of a round are a copy, and a callback may take away what a later entry of the copy stands
-// for. That does no harm: their functions look at the session, which outlives its interests.
+// The interests of a round are a copy, and a callback may take away what a later entry of the copy refers
+// to. That does no harm: their functions look at the session, which outlives its interests.
 #include <algorithm>
 #include <cerrno>
 #include <csignal>

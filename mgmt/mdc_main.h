@@ -52,7 +52,7 @@ lc_status mdc_foreach_binding_prequeried_parsed(const bn_binding_array *bindings
                                                 mdc_foreach_function callback, void *data,
                                                 uint32_t *out_count);
 
-// Takes a configuration change event apart. Either out may be null. A deleted node stands among the new
+// Takes a configuration change event apart. Either out may be null. A deleted node is among the new
 // values with the deleted mark in its flags.
 lc_status mdc_event_config_change_notif_extract(bn_binding_array *bindings, bn_binding_array **out_old,
                                                 bn_binding_array **out_new);

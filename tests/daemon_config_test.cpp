@@ -1,4 +1,4 @@
-// The configuration applied to an engine that stands still: what a group is made of, what each change does,
+// The configuration applied to an engine without threads: what a group is made of, what each change does,
 // and what is said of values that make no sense.
 #include "daemon/wccpd_config.h"
 #include "daemon/wccpd_early_changes.h"
@@ -104,7 +104,7 @@ TEST_F(DaemonConfig, AGroupIsMadeOfItsWholeSubtree) {
 TEST_F(DaemonConfig, OneNodeOfARunningGroup) {
     wccp_service_group *group = make("51");
     ASSERT_NE(group, nullptr);
-    EXPECT_TRUE(group->admin_state == 0 && group->hia_timer.active == 0); // bare, it stands still
+    EXPECT_TRUE(group->admin_state == 0 && group->hia_timer.active == 0); // bare, it does not run
     EXPECT_EQ(said("<139>"), 0);                                          // facility local1, level error
     std::vector<uint32_t> expected;
     for (const auto &node : nodes)

@@ -1,4 +1,4 @@
-// The monitoring tree over an engine that stands still: every node's type and value, what is listed, and what
+// The monitoring tree over an engine without threads: every node's type and value, what is listed, and what
 // is answered for that which isn't there.
 #include "daemon/wccpd_monitor.h"
 #include "engine/wccp_utils.h"

@@ -1,4 +1,5 @@
-// The table of the designated appliance: the split, the order behind it, down entries, and the mask's values.
+// The table of the designated appliance: the split, the order of the owners, down entries, and the mask's
+// values.
 #include "engine/wccp_assignment.h"
 
 #include <algorithm>
@@ -124,7 +125,7 @@ struct AssignmentTest : testing::Test {
                                                   each.weight, 1,       WCCP_LISTED_BY_ALL};
             wccp_designated_appliance_assignment_add(group.get(), &reported);
             ASSERT_LE(group->dsg_appliance_count, WCCP_MAX_APPLIANCES);
-            ASSERT_EQ(group->bucket_count, 0u); // lies right behind the entries
+            ASSERT_EQ(group->bucket_count, 0u); // lies right after the entries
         }
         wccp_designated_appliance_assignment_finish(group.get());
     }

@@ -1,5 +1,5 @@
-// Descriptors that change hands between a receiver's wait and its read. The program's own poll stands in
-// front of that of the C library, so that the change comes at the very moment.
+// Descriptors that change hands between a receiver's wait and its read. The program's own poll replaces
+// that of the C library, so that the change comes at the very moment.
 
 #include <csignal>
 #include <functional>

@@ -18,7 +18,7 @@
 
 namespace {
 
-// The texts as an operator has them, each behind a line with its name.
+// The texts as an operator has them, each after a line with its name.
 const std::map<std::string, std::string> golden = [] {
     std::ifstream file(WCCP_SOURCE_DIR "/tests/golden/engine_dumps.txt");
     std::map<std::string, std::string> found;

@@ -409,7 +409,7 @@ TEST_F(Network, OneDatagramIsReadAtATimeAndTheMulticastSocketFirst) {
     EXPECT_EQ(wccp_rx_pkt(wan, &pkt, 4096), 10);
     EXPECT_TRUE(pkt.data[0] == 1 && pkt.data[10] == 2);
 
-    // As long as the buffer, and longer: no byte behind it is written.
+    // As long as the buffer, and longer: no byte after it is written.
     send("10.0.0.100", 4096, 3);
     send("10.0.0.100", 5000, 4);
     send("10.0.0.100", 3000, 5);
@@ -562,7 +562,7 @@ TEST_F(Network, AnInterfaceMadeAgainWithItsAddressIsJoinedAgain) {
 }
 
 TEST_F(Network, AnAddressChangesGoesAndComes) {
-    // The farewell of the old address comes from the old socket, as long as the kernel lets it.
+    // The shutdown message of the old address comes from the old socket, as long as the kernel lets it.
     wccp_service_group *known = live_group();
     const auto last_word = [](const std::vector<uint8_t> &message) {
         return std::vector<uint8_t>(message.end() - 4, message.end());

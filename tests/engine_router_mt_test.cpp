@@ -1,4 +1,4 @@
-// Sending routers behind GRE tunnels, with tunneld on the other side of the mailbox: one tunnel for each
+// Sending routers with GRE tunnels, with tunneld on the other side of the mailbox: one tunnel for each
 // router, and nothing lost when the thread that waits for tunneld is cancelled.
 #include <pthread.h>
 

@@ -20,7 +20,7 @@
 
 static std::vector<std::string> state_events; // constant, group, role and code of each
 
-// In the place of the platform library's.
+// Replaces the platform library's.
 extern "C" int qv_state_event_send(uint32_t one, const char *group_id, uint32_t role, const uint8_t *code,
                                    gcl_session *) {
     state_events.push_back(std::to_string(one) + " " + group_id + " " + std::to_string(role) + " " +
@@ -227,7 +227,7 @@ TEST_F(StateTest, StatesTellTheirRolesEachTime) {
         EXPECT_EQ(group->state_time, step.state_time);
         wccp_g.seconds += 10;
     }
-    wccpd_exiting = 1; // the role changes, but nobody is told
+    wccpd_exiting = 1; // the role changes, but no event is sent
     wccp_appliance_state_active(group);
     wccpd_exiting = 0;
     EXPECT_TRUE(group->state_flags & WCCP_STATE_ACTIVE);
@@ -285,7 +285,7 @@ TEST_F(StateTest, ALaterReasonLeavesTheCheckWhereItIs) {
     EXPECT_EQ(group->router_alarm_timer.active + group->assign_alarm_timer.active, 0);
 }
 
-// The two checks: what the log says behind "alarm: ", and whether an event went, which fails without a
+// The two checks: what the log says after "alarm: ", and whether an event went, which fails without a
 // session.
 struct CheckTest : StateTest {
     std::string said(int (*check)(wccp_service_group *)) {
@@ -317,7 +317,7 @@ TEST_F(CheckTest, ConnectivityIsHealthyWithEnoughTwoWayAndNoneOneWay) {
                                   "two-way: 0\n" +
                                   raise);
     see(ROUTER_A, {}, {{US, 1}});
-    EXPECT_EQ(connectivity(), begin); // it stands already
+    EXPECT_EQ(connectivity(), begin); // it is active already
     group->mcast_configured = 1;      // then one is enough
     EXPECT_EQ(connectivity(),
               begin + "clearing router down alarm: routers one-way: 0 two-way: 1 configured: 1.\n" + clear);

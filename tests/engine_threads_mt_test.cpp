@@ -216,7 +216,8 @@ TEST_F(Threads, ExitWhileAReceiverWaitsForAnAbsentTunneld) {
     }
 }
 
-// What waited for the lock through the beginning of an exit opens nothing, starts nobody and tells nothing.
+// What waited for the lock through the beginning of an exit opens nothing, starts no group and sends no
+// event.
 TEST_F(Threads, NotificationsAndADatagramThatComeThroughAnExit) {
     wccp_service_group *group = add_group(61, "wan0");
     wccp_interface *wan = group->interfaces[0];

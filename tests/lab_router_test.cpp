@@ -101,7 +101,7 @@ TEST(LabRouter, EchoesTheHashAssignmentItAdopted) {
     lab.send(LOW, hash_assignment(LOW, newest(), change));
     EXPECT_EQ(lab.result(), "adopted again");
     const bytes answer = lab.send(LOW, hello(LOW, 100, newest()));
-    // Behind header, security, service and identity with two addresses: the view, its key and the owners'
+    // After header, security, service and identity with two addresses: the view, its key and the owners'
     // bits.
     const bytes view(answer.begin() + 44 + 28, answer.end());
     const bytes wanted =

@@ -21,7 +21,7 @@ static std::string text(const tstring *string) {
 
 // ---- Text
 
-// Each type by its number, the wire form of its first text (the kind, and what stands behind id, type and
+// Each type by its number, the wire form of its first text (the kind, and what follows id, type and
 // flags), texts, with "in -> out" where one comes back as another, and texts that are refused.
 struct type_case {
     uint32_t type, kind;
@@ -135,7 +135,7 @@ TEST(Texts, BadOnesAreRefusedAndNothingIsLogged) {
             EXPECT_EQ(bn_attrib_get_uint32(attrib, nullptr, nullptr, &kept), LC_OK);
             EXPECT_EQ(kept, 77u);
             if (type == bn_type_utf8_string)
-                log.take(); // tells its bytes
+                log.take(); // the line has its bytes
 
             binding_owner binding;
             uint32_t word = 0;
@@ -225,7 +225,7 @@ TEST(Wire, EachFamilyByteForByte) {
         EXPECT_EQ(back->type | back->type_flags, c.type);
 
         for (size_t length = 1; length < golden.size(); length++) {
-            // Exactly the bytes that came, so that a read behind them is seen.
+            // Exactly the bytes that came, so that a read past them is seen.
             const std::vector<char> bytes(golden.data(), golden.data() + length);
             buffer_owner cut;
             attrib_owner none;

@@ -251,7 +251,7 @@ struct monitored {
         return LC_OK;
     }
     lc_status dispatch() { return mdc_dispatch_mon_request(with.session, request, get, this, list, this); }
-    // Each binding of the answer, with the id of the node that it answers behind it.
+    // Each binding of the answer, followed by the id of the node that it answers.
     strings answer() {
         const wire frame = with.provider.take_frame(100);
         owner<tbuffer, tb_free> buffer;

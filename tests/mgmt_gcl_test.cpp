@@ -347,7 +347,7 @@ TEST_F(Gcl, FramesInEveryCut) {
     EXPECT_EQ(client.frames[2], be(8, 2) + "text");
 
     client.frames.clear();
-    ASSERT_TRUE(provider.put(text + small + "GCLF")); // with the end behind them
+    ASSERT_TRUE(provider.put(text + small + "GCLF")); // followed by the end
     provider.close_client();
     round();
     EXPECT_EQ(client.frames.size(), 2u);
@@ -462,7 +462,7 @@ TEST_F(Gcl, TheReaderNests) {
     EXPECT_EQ(count[3], 4u);
 }
 
-// The session goes while its reader stands in a handler: closed by the peer in an inner round, closed by the
+// The session ends while its reader is in a handler: closed by the peer in an inner round, closed by the
 // handler, or freed by it.
 TEST_F(Gcl, TheSessionGoesUnderItsReader) {
     for (int way = 0; way < 3; way++) {

@@ -203,7 +203,7 @@ TEST(messages, response_bytes_and_reading) {
     }
 }
 
-// Announcements that no bytes stand behind, and values that are no values.
+// Lengths that no bytes follow, and values that are malformed.
 TEST(messages, lies_are_refused) {
     const wire start = room + request(7, str("")), node = u32(1) + u32(1000) + u8(1);
     const wire named = start + node + u32(1) + str("n"), huge = u32(UINT32_MAX);

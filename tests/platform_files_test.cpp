@@ -1,5 +1,5 @@
 // The platform's files: what is read is bounded and what is bad in them loses nothing else; what is written
-// stands as a whole or not at all.
+// is there as a whole or not at all.
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -77,7 +77,7 @@ TEST_F(Files, LimitsComeFromTheLinesThatAreGood) {
          "max_interfaces \nmax_interfaces twelve\nmax_interfaces 4294967424\nmax_interfaces "
          "99999999999999999999999\nmax_interfacesx 3\nMAX_INTERFACES 3\nmax_interface 3\nmax_user_tunnels 8",
          8, 128},
-        // A line longer than any good one is one bad line, not several; a NUL hides nothing behind it.
+        // A line longer than any good one is one bad line, not several; a NUL hides nothing after it.
         {"max_interfaces 5" + std::string(5000, ' ') + "\nmax_user_tunnels 6\n", 6, 128},
         {std::string(126, '#') + "\nmax_user_tunnels 6\na" + '\0' + "b\nmax_interfaces 7\n", 6, 7},
     };

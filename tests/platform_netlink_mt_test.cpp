@@ -1,5 +1,5 @@
 // Interfaces that come, go and change under the notifications: whatever happens, and in whatever order or
-// number it is told, the picture that a program has at the end is the kernel's.
+// number it hears of them, what a program knows at the end is what the kernel has.
 
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
@@ -210,7 +210,7 @@ struct Netlink : testing::Test {
     "unshare -n sleep 60 & other=$!; "                                                                       \
     "while [ $(readlink /proc/$other/ns/net) = $(readlink /proc/self/ns/net) ]; do sleep .01; done; "        \
     "ip link set va netns $other; "
-// What changes, and what is told of it or never is.
+// What changes, and which of it is reported.
 const struct {
     const char *commands, *told, *never_told;
 } changes[] = {
@@ -294,7 +294,7 @@ TEST_F(Netlink, EachChangeIsTold) {
     }
 }
 
-// A callback stands still while the kernel's queue runs over many times; among the notifications that are
+// A callback is blocked while the kernel's queue runs over many times; among the notifications that are
 // lost are the ones that count.
 TEST_F(Netlink, AnOverrunEndsInTheRightState) {
     for (const auto &change : changes) {
@@ -349,7 +349,7 @@ TEST_F(Netlink, AnyOrderOfEverythingEndsInTheRightState) {
 }
 
 // The library's thread is in the middle of its work while exit() takes the process down. Streams are flushed
-// behind the last destructor, those of libraries included.
+// after the last destructor, those of libraries included.
 static ssize_t draw_out(void *, const char *, size_t count) {
     usleep(100000);
     return static_cast<ssize_t>(count);

@@ -209,7 +209,7 @@ TEST_F(FdicBridge, ChangesOfAnotherThreadAreTheLoopsToMake) {
     EXPECT_EQ(round(), (list_of{"1:1", "2:2"}));
     std::thread([&] { EXPECT_EQ(fdic_event_update_fd(list, second, 0, 0), LC_OK); }).join();
     calls.clear();
-    EXPECT_EQ(fdic_event_update_fd(list, second, 0, 1), LC_OK); // behind the other's change
+    EXPECT_EQ(fdic_event_update_fd(list, second, 0, 1), LC_OK); // after the other's change
     EXPECT_EQ(round(), (list_of{"2:2"}));
     std::thread([&] { EXPECT_EQ(fdic_event_delete_fd(list, second), LC_OK); }).join();
     calls.clear(); // taken down with the change still waiting

@@ -31,7 +31,7 @@ static std::string read_file(const char *path) {
     return {std::istreambuf_iterator<char>(file), {}};
 }
 
-// The text behind the syslog head and the thread mark.
+// The text after the syslog head and the thread mark.
 static std::string body(const std::string &line) {
     const size_t mark = line.find("TID ");
     return mark == std::string::npos ? line : line.substr(line.find(": ", mark) + 2);

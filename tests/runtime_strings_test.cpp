@@ -210,7 +210,7 @@ TEST(Tokens, JoinAndComeBack) {
     EXPECT_EQ(joined({"a", "", "b"}, '/', 0, 0x600), "a/b/");
     EXPECT_EQ(joined({"a\\b", "c\\\\d"}, '/', '\\', 0), "a\\b/c\\\\\\d");
     EXPECT_EQ(joined({"a"}, 0, 0, 0x100), "(failed)");
-    // An escape at the end of a part must not swallow the separator behind it.
+    // An escape at the end of a part must not swallow the separator after it.
     for (const char *part : {"a\\", "\\\\", "\\/", "/", "x\\/\\"}) {
         const std::string name = joined({part, part, "end"}, '/', '\\', 0x100);
         EXPECT_EQ(tokens(name.c_str(), '/', '\\', 0, 0x2c), std::string("[") + part + "][" + part + "][end]");
@@ -245,7 +245,7 @@ TEST(Buffers, GapsLengthsAndLimits) {
     EXPECT_EQ(tb_delete_bytes(buffer, 1, 2), LC_NO_BUFFER_SPACE);
     EXPECT_EQ(tb_delete_bytes(buffer, 0xffffffff, 2), LC_NO_BUFFER_SPACE);
     EXPECT_EQ(tb_set_length(buffer, 129), LC_GENERIC);
-    EXPECT_EQ(tb_set_length(buffer, 128), LC_OK); // full to the brim, the NUL behind it
+    EXPECT_EQ(tb_set_length(buffer, 128), LC_OK); // full to the brim, the NUL after it
     EXPECT_EQ(tb_buf(buffer)[128], 0);
     uint32_t number = 7;
     EXPECT_TRUE(tb_get_uint32(buffer, 124, &number) == LC_OK && number == 0);

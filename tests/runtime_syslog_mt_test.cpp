@@ -1,4 +1,4 @@
-// The log and its daemon: one that reads, one that stands still, one that goes and comes back, none at all;
+// The log and its daemon: one that reads, one that is stopped, one that ends and comes back, none at all;
 // threads that are cancelled while they log, and a process that forks then.
 #include "runtime/logging.h"
 
@@ -20,7 +20,7 @@ static void log_numbered(int from, int to) {
         QV_LOG(LC_LOG_DEBUG, "line %d.", i);
     }
 }
-// The number behind `words`, -1 without them.
+// The number after `words`, -1 without them.
 static int number_in(const std::string &line, const char *words) {
     const size_t at = line.find(words);
     return at == std::string::npos ? -1 : atoi(line.c_str() + at + strlen(words));
@@ -41,7 +41,7 @@ struct Syslog : testing::TestWithParam<int> {
         daemon = std::make_unique<log_daemon>(GetParam());
         ASSERT_EQ(lc_log_init("wccpd", nullptr, 0, 0x1060000, 7, 136, 1), LC_OK);
         ASSERT_EQ(lc_log_set_daemon_log_level(7), LC_OK);
-        log_numbered(-1, 0); // takes along what is to be told of an earlier case
+        log_numbered(-1, 0); // takes along what is still to be reported of an earlier case
         (void)daemon->take();
     }
     void TearDown() override { (void)lc_log_close(); }
@@ -55,7 +55,7 @@ static void expect_burst(log_daemon *daemon, useconds_t rest_us) {
     std::vector<std::string> lines;
     for (int attempt = 0; attempt < 3 && lines.size() != 500; attempt++) {
         (void)daemon->take();
-        log_numbered(-1, 0); // takes along what is to be told of the last try
+        log_numbered(-1, 0); // takes along what is still to be reported of the last try
         (void)daemon->take();
         lines.clear();
         std::thread reader([&] {
@@ -129,7 +129,7 @@ TEST_P(Syslog, ADaemonThatGoesAndComesBackIsFound) {
     expect_lines(daemon->take(), 0, 9, 12);
 
     log_numbered(0, FLOOD);
-    log_daemon successor; // the old one still holds its socket, and stands still
+    log_daemon successor; // the old one still holds its socket, and is stopped
     log_numbered(0, 3);
     const std::vector<std::string> lines = successor.take();
     ASSERT_EQ(lines.size(), 4u);
@@ -182,5 +182,5 @@ TEST_P(Syslog, AForkedChildCanLog) {
     stop = true;
     writer.join();
     reader.join();
-    EXPECT_GE(from_children, 15); // all of them, unless the reader stands still on a busy machine
+    EXPECT_GE(from_children, 15); // all of them, unless the reader is held up on a busy machine
 }

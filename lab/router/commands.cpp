@@ -1,4 +1,4 @@
-// What a router can be told while it runs, one row a command: its words, and what they do to the machine.
+// The commands that a running router takes, one row each: its words, and what they do to the machine.
 #include "lab/router/router.h"
 
 #include <algorithm>

@@ -22,7 +22,7 @@ bool link_becomes(const char *interface, uint32_t status);
 // How many threads of this process have a name that begins so; a thread names itself when it first runs.
 int threads_named(const std::string &name);
 
-// A packet as a receive thread hands it on. Under the address sanitizer nothing behind `length` can be
+// A packet as a receive thread hands it on. Under the address sanitizer nothing after `length` can be
 // touched.
 using received_packet = std::unique_ptr<wccp_pkt, void (*)(wccp_pkt *)>;
 received_packet make_received(const std::vector<uint8_t> &bytes, be32 from);

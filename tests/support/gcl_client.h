@@ -1,4 +1,4 @@
-// A session with all that stands under it, as the daemon puts it together, and a body protocol that records.
+// A session with all that it is built on, as the daemon puts it together, and a body protocol that records.
 #pragma once
 
 #include <functional>

@@ -1,4 +1,4 @@
-// What the process under test writes to the log: a reader behind /dev/log, which is the test's own.
+// What the process under test writes to the log: a reader of /dev/log, which is the test's own.
 #pragma once
 
 #include <algorithm>

@@ -1,4 +1,4 @@
-// A log daemon for tests of the runtime: owns /dev/log, reads when it is told to.
+// A log daemon for tests of the runtime: owns /dev/log, reads on request.
 #pragma once
 
 #include <cstring>
@@ -72,7 +72,7 @@ struct log_daemon {
                 lines.push_back(partial.substr(0, end));
         }
     }
-    // The one line that came, else a text that tells how many did.
+    // The one line that came, else a text with the number that did.
     std::string one() {
         const std::vector<std::string> lines = take();
         return lines.size() == 1 ? lines[0] : std::to_string(lines.size()) + " lines";

@@ -1,5 +1,5 @@
 // A service group that learns of routers and appliances by the engine's own calls, with no packet and no
-// network behind it. Its one interface is ready but has no sockets: what it sends is built and counted.
+// network. Its one interface is ready but has no sockets: what it sends is built and counted.
 #pragma once
 
 #include <utility>

@@ -1,4 +1,4 @@
-// Messages written byte by byte, as the wire has them: numbers with their size, big-endian, one behind the
+// Messages written byte by byte, as the wire has them: numbers with their size, big-endian, one after the
 // other. Knows no layout, so that a test states each one itself.
 #pragma once
 
