@@ -12,6 +12,9 @@
 #define NODE_SYSTEM_MODE NODE_SYSTEM_CONFIG "/mode"
 #define NODE_SYSTEM_BONDING NODE_SYSTEM_CONFIG "/bonding"
 #define NODE_SYSTEM_10G NODE_SYSTEM_CONFIG "/10g"
+#define NODE_INTERCEPT_CONFIG "/qv/tunneld/intercept/config" // by service group
+#define NODE_BYPASS_CONFIG "/qv/tunneld/bypass/config"       // by prefix
+#define NODE_ACCEPT_CONFIG "/qv/tunneld/accept/config"       // by address
 #define NODE_SYSLOG "/logging/syslog"
 #define NODE_SYSLOG_FACILITY NODE_SYSLOG "/facility"
 #define NODE_SYSTEM_FACILITY NODE_SYSLOG_FACILITY "/system"
@@ -21,6 +24,11 @@
 #define NODE_WCCPD_STATUS NODE_WCCPD_STATE "/is_alive"
 #define NODE_WCCPD_VERSION NODE_WCCPD_STATE "/version"
 #define NODE_GROUP_STATE NODE_WCCPD "/wccp/srv_grp/state"
+
+// --- State nodes, answered by tunneld
+#define NODE_PLANE_STATE "/qv/tunneld/plane/state"
+#define NODE_TUNNEL_STATE "/qv/tunneld/tunnel/state"       // by tunnel id
+#define NODE_INTERCEPT_STATE "/qv/tunneld/intercept/state" // by service group
 
 // --- State nodes, kept by mgmtd
 #define NODE_ALARM_STATE "/qv/alarms/state"
@@ -32,6 +40,10 @@
 #define EVENT_RAISE_ALARM "/qv/alarms/events/raise_alarm"
 #define EVENT_CLEAR_ALARM "/qv/alarms/events/clear_alarm"
 #define EVENT_ROLE_CHANGE "/qv/state/events/role_change"
+// From tunneld: a group leaves its routers, or joins them again, without a change of the configuration.
+#define EVENT_GROUP_LEAVE "/qv/tunneld/events/group_leave"
+#define EVENT_GROUP_JOIN "/qv/tunneld/events/group_join"
+#define EVENT_PROXY_CHANGE "/qv/tunneld/events/proxy_change"
 #define EVENT_PROCESS_CRASH "/pm/events/failure/crash"
 #define EVENT_PROCESS_EXIT "/pm/events/failure/unexpected_exit"
 #define EVENT_PROCESS_TERMINATE "/pm/events/proc/terminate"

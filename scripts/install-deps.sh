@@ -1,8 +1,8 @@
 #!/bin/bash
 # install-deps.sh WHAT...: installs what is missing for `build`, `lab`, `test` (Debian 12; as root or through sudo).
 set -eu
-build="g++ cmake ninja-build pkg-config libevent-dev libnuma-dev libmd-dev libnl-route-3-dev libcli11-dev nlohmann-json3-dev"
-lab="iproute2 util-linux procps mount jq"
+build="g++ cmake ninja-build pkg-config libevent-dev libnuma-dev libmd-dev libnl-route-3-dev libnftables-dev libcli11-dev nlohmann-json3-dev"
+lab="iproute2 util-linux procps mount jq nftables haproxy curl"
 capture="tcpdump tshark"
 test="libgtest-dev libbenchmark-dev clang-14 libclang-rt-14-dev clang-format-14 clang-tidy-14 git $capture"
 wanted=

@@ -1,0 +1,42 @@
+// The rules that sort redirected packets: to the proxy, back to the router, on by the routing table, or
+// nowhere. One nftables table of ours, changed by transactions: at each moment either the old rules hold or
+// the new ones.
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <string>
+
+#include "peers/tunneld/wanted_state.h"
+
+struct packet_count {
+    uint64_t packets = 0, bytes = 0;
+};
+// What became of redirected packets.
+enum sorted_as : uint8_t {
+    SORTED_IN,       // all that came in by the interface
+    SORTED_TO_PROXY, // to a transparent socket, or handed to the proxy as a new flow
+    SORTED_BYPASSED,
+    SORTED_RETURNED, // nobody wanted it
+    SORTED_DOWN,     // wanted, but the proxy is down or the group not active: by the intercept's `down`
+    SORTED_FORWARDED,
+    SORTED_DROPPED,
+    SORTED_OWN, // the appliance's own traffic, redirected to itself
+    SORTED_WAYS
+};
+extern const char *const sorted_words[SORTED_WAYS]; // "in", "to_proxy", ...
+struct sorting_counters {
+    std::map<std::string, packet_count[SORTED_WAYS]> interfaces; // links and L2 interfaces
+    std::map<uint8_t, packet_count[SORTED_WAYS]> groups; // with an intercept: what its rules have decided
+    std::map<tunnel_ends, uint64_t> fragments;           // outer fragments by their ends
+    std::map<uint32_t, uint64_t>
+        refused_sources;  // GRE to one of our ends from no router of ours (kernel plane)
+    uint64_t clamped = 0; // SYN-ACKs
+};
+
+// Counters of objects that stay keep their values.
+bool apply_sorting_rules(const wanted_sorting &wanted, std::string *out_error);
+bool remove_sorting_rules(std::string *out_error);
+bool read_sorting_counters(sorting_counters *out, std::string *out_error);
+// What a kernel lacks for the rules, or "".
+std::string probe_sorting_rules();
