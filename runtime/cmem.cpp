@@ -414,6 +414,16 @@ static void place_on_node(void *memory, const cmem_block *block) {
         numa_interleave_memory(memory, block->length, numa_all_nodes_ptr);
 }
 
+int32_t cmem_find_creator(const char *name, bool *out_lives) {
+    *out_lives = false;
+    const cmem_registry *known = registry;
+    const cmem_block *block = known ? find_block(registry, name) : nullptr;
+    if (!block)
+        return 0;
+    *out_lives = creator_lives(known, block);
+    return block->pid;
+}
+
 void *cmem_create_block(uint64_t length, const char *name) {
     if (!name || !*name)
         return nullptr;

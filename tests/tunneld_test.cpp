@@ -3,44 +3,22 @@
 
 #include <gtest/gtest.h>
 #include <sched.h>
-#include <signal.h>
 #include <sys/shm.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <functional>
 #include <map>
 #include <string>
 #include <thread>
 
-#include "peers/tunneld/tunneld.h"
+#include "peers/tunneld/commands.h"
 #include "platform/tunnel_mailbox.h"
 #include "runtime/cmem.h"
 
 using namespace std::chrono_literals;
-
-// The C library's, in its place: with a clock of the test, on which a sleep takes no time.
-static std::function<bool()> wakes_up; // ends the program when true
-static int64_t clock_ms;
-extern "C" int sigtimedwait(const sigset_t *, siginfo_t *, const timespec *time) {
-    const int64_t ms = time->tv_sec * 1000 + time->tv_nsec / 1000000;
-    if (!wakes_up) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(ms));
-        return -1;
-    }
-    clock_ms += ms;
-    return wakes_up() ? SIGTERM : -1;
-}
-extern "C" int clock_gettime(clockid_t clock, timespec *out) noexcept {
-    const long result = syscall(SYS_clock_gettime, clock, out);
-    if (wakes_up)
-        *out = {clock_ms / 1000, clock_ms % 1000 * 1000000};
-    return static_cast<int>(result);
-}
 
 namespace {
 
@@ -55,6 +33,11 @@ void give(uint16_t code, uint16_t id, uint32_t remote) {
     mailbox->command = code;
 }
 
+bool take_one(command_desk *desk) {
+    bool end = false;
+    return take_command(desk, &end);
+}
+
 void write_mem_conf() {
     const std::filesystem::path conf = CMEM_CONF_PATH;
     std::filesystem::create_directories(conf.parent_path());
@@ -64,7 +47,7 @@ void write_mem_conf() {
 struct Tunneld : testing::Test {
     static void SetUpTestSuite() {
         write_mem_conf();
-        EXPECT_FALSE(tunneld_step(&before_wccpd));
+        EXPECT_FALSE(take_one(&before_wccpd));
         EXPECT_FALSE(before_wccpd.attached);
         mailbox = static_cast<wccp_tunnel_mailbox *>(
             cmem_create_block(sizeof(wccp_tunnel_mailbox), WCCP_MAILBOX_NAME));
@@ -88,13 +71,13 @@ struct Tunneld : testing::Test {
         told = all.size();
         return fresh;
     }
-    static tunneld before_wccpd;
-    tunneld daemon;
+    static command_desk before_wccpd;
+    command_desk desk;
     FILE *out = nullptr;
     char *text = nullptr;
     size_t length = 0, told = 0;
 };
-tunneld Tunneld::before_wccpd;
+command_desk Tunneld::before_wccpd;
 
 } // namespace
 
@@ -120,10 +103,10 @@ TEST(Mailbox, ABlockThatIsTooShortIsNotUsed) {
 TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
     constexpr uint16_t ADD = MAILBOX_ADD_TUNNEL, DELETE = MAILBOX_DELETE_TUNNEL;
     constexpr uint32_t NONE = WCCP_NO_INDEX;
-    const tunneld_options does = {.first_index = 7}, refuses = {.refuse = true},
+    const command_options does = {.first_index = 7}, refuses = {.refuse = true},
                           without_index = {.first_index = WCCP_NO_INDEX}, is_silent = {.silent = true};
     const struct {
-        const tunneld_options *options; // of a daemon that starts here
+        const command_options *options; // of a daemon that starts here
         uint16_t code, id;
         uint32_t remote, status, index; // index: what the mailbox holds then
         std::string said;               // of a tunnel, after what it is
@@ -149,13 +132,13 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
     for (const auto &step : steps) {
         SCOPED_TRACE(&step - steps);
         if (step.options) {
-            tunneld_start(&daemon, *step.options, out);
-            EXPECT_FALSE(tunneld_step(&daemon)) << "nothing to do";
+            start_commands(&desk, *step.options, out);
+            EXPECT_FALSE(take_one(&desk)) << "nothing to do";
             lines();
         }
         give(step.code, step.id, 0x0A000000 + step.remote);
         mailbox->status = 77;
-        EXPECT_EQ(tunneld_step(&daemon), step.status != 77);
+        EXPECT_EQ(take_one(&desk), step.status != 77);
         EXPECT_EQ(mailbox->command, step.status == 77 ? step.code : 0);
         EXPECT_EQ(mailbox->status, step.status);
         EXPECT_EQ(mailbox->fmst_index, step.index);
@@ -166,13 +149,13 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
                    (step.index == NONE ? "none" : std::to_string(step.index)) + ": " + line;
         EXPECT_EQ(lines(), line.empty() ? "" : line + "\n");
     }
-    ASSERT_EQ(daemon.tunnels.size(), 1u);
-    EXPECT_EQ(daemon.tunnels.at(301).remote, 0x0A000009u);
+    ASSERT_EQ(desk.tunnels.size(), 1u);
+    EXPECT_EQ(desk.tunnels.at(301).remote, 0x0A000009u);
 }
 
 // A command that wccpd takes back while it is carried out: an answer would be taken for another command's.
 TEST_F(Tunneld, ACommandThatWasGivenUpGetsNoAnswer) {
-    tunneld_start(&daemon, {.slow_ms = 60}, out);
+    start_commands(&desk, {.slow_ms = 60}, out);
     static const struct {
         uint16_t code;
         uint16_t id;
@@ -190,28 +173,41 @@ TEST_F(Tunneld, ACommandThatWasGivenUpGetsNoAnswer) {
             __atomic_store_n(&mailbox->tunnel_id, row.id ? row.id : uint16_t{310}, __ATOMIC_RELEASE);
             mailbox->command = row.code;
         });
-        EXPECT_TRUE(tunneld_step(&daemon));
+        EXPECT_TRUE(take_one(&desk));
         wccpd.join();
         EXPECT_EQ(mailbox->status, row.answered ? 0u : 77u) << row.code << " " << row.id;
-        EXPECT_EQ(daemon.tunnels.size(), row.answered ? 1u : 0u);
+        EXPECT_EQ(desk.tunnels.size(), row.answered ? 1u : 0u);
         EXPECT_EQ(mailbox->command, row.answered ? 0 : row.code);
     }
 }
 
-// After a quiet minute it wakes up 20 times a second, and the next command is answered all the same.
-TEST_F(Tunneld, WakesUpSeldomWhenItIsQuiet) {
-    std::map<int64_t, int> in_second;
-    tunneld_start(&daemon, {}, out);
-    wakes_up = [&] {
-        in_second[clock_ms / 1000]++;
-        if (clock_ms == 90000)
-            give(MAILBOX_ADD_TUNNEL, 320, 0x0A000002);
-        return clock_ms >= 95000;
+// The tunnels as somebody else makes them: each change of the table is applied, also the undoing of an add.
+TEST_F(Tunneld, AppliesEachChangeOfTheTable) {
+    std::map<uint16_t, command_tunnel> made;
+    uint32_t next = 40;
+    start_commands(&desk, {.slow_ms = 60}, out);
+    desk.apply = [&](std::map<uint16_t, command_tunnel> *tunnels) {
+        for (auto &[id, tunnel] : *tunnels)
+            if (tunnel.index == WCCP_NO_INDEX && tunnel.remote != 0x0A000063)
+                tunnel.index = next++;
+        made = *tunnels;
     };
-    tunneld_run(&daemon);
-    wakes_up = nullptr;
-    EXPECT_EQ(in_second[30], 200);
-    EXPECT_EQ(in_second[80], 20);
-    EXPECT_EQ(mailbox->command, 0);
-    EXPECT_EQ(in_second[93], 200);
+    give(MAILBOX_ADD_TUNNEL, 310, 0x0A000002);
+    EXPECT_TRUE(take_one(&desk));
+    EXPECT_EQ(mailbox->fmst_index, 40u);
+    give(MAILBOX_ADD_TUNNEL, 311, 0x0A000063); // which cannot be made
+    EXPECT_TRUE(take_one(&desk));
+    EXPECT_EQ(mailbox->fmst_index, WCCP_NO_INDEX);
+    EXPECT_EQ(made.size(), 1u);
+    give(MAILBOX_ADD_TUNNEL, 312, 0x0A000003);
+    std::thread wccpd([] {
+        std::this_thread::sleep_for(20ms);
+        mailbox->command = 0;
+    });
+    EXPECT_TRUE(take_one(&desk));
+    wccpd.join();
+    EXPECT_EQ(made.size(), 1u) << "the add that was withdrawn is undone";
+    give(MAILBOX_DELETE_TUNNEL, 310, 0x0A000002);
+    EXPECT_TRUE(take_one(&desk));
+    EXPECT_TRUE(made.empty());
 }

@@ -1,44 +1,33 @@
-// tunneld [--json] [--roles] [--slow MS] [--refuse] [--silent] [--index N]
-
-#include <signal.h>
-
+// tunneld [--plane auto|kernel|user|table] [--return-redirect] [--json] [--roles] [--slow MS] [--refuse]
+// [--silent]
+//         [--index N]
 #include <CLI/CLI.hpp>
 
 #include "peers/tunneld/tunneld.h"
-#include "runtime/common.h"
-#include "runtime/logging.h"
 #include "runtime/version.h"
-
-static constexpr uint32_t COMPONENT_TUNNELD = 257u << 16;
 
 // NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
     tunneld_options options;
-    CLI::App app{"The tunnel daemon: takes the commands that wccpd leaves in the mailbox, and prints them."};
+    CLI::App app{"The tunnel daemon: carries redirected packets to local proxies and back to the routers."};
     app.set_version_flag("--version", std::string("tunneld ") + wccp_version());
-    app.add_flag("--json", options.json, "one JSON object for each command");
-    app.add_flag("--roles", options.roles, "print changes of policy group roles as well");
-    app.add_option("--slow", options.slow_ms, "take so many milliseconds for each command");
-    app.add_flag("--refuse", options.refuse, "answer every command with a failure");
-    app.add_flag("--silent", options.silent, "answer no command");
-    app.add_option("--index", options.first_index,
-                   "index of the first tunnel; 4294967295 gives none, which makes an add fail");
+    app.add_option("--plane", options.plane,
+                   "the data plane: kernel (GRE of the kernel), user (user space), table (none: a table of "
+                   "tunnels, for tests), or auto: the first of kernel and user that works here")
+        ->check(CLI::IsMember({"auto", "kernel", "user", "table"}))
+        ->capture_default_str();
+    app.add_flag("--return-redirect", user_plane_settings.redirect_header,
+                 "packets go back to the routers with their redirect header; user-space data plane only");
+    app.add_flag("--json", options.commands.json, "one JSON object for each command");
+    app.add_flag("--roles", options.commands.roles, "print changes of policy group roles as well");
+    app.add_option("--slow", options.commands.slow_ms, "take so many milliseconds for each command");
+    app.add_flag("--refuse", options.commands.refuse, "answer every command with a failure");
+    app.add_flag("--silent", options.commands.silent, "answer no command");
+    app.add_option("--index", options.commands.first_index,
+                   "index of the first tunnel with --plane table; 4294967295 gives none, which makes an add "
+                   "fail");
     CLI11_PARSE(app, argc, argv);
-
-    sigset_t set;
-    sigemptyset(&set);
-    for (const int signal : {SIGTERM, SIGINT, SIGHUP})
-        sigaddset(&set, signal);
-    sigprocmask(SIG_BLOCK, &set, nullptr);
-    signal(SIGPIPE, SIG_IGN);
-
-    lc_init();
-    lc_log_init("tunneld", nullptr, 0, COMPONENT_TUNNELD, LC_LOG_DEBUG,
-                lc_log_get_facility(nullptr, "tunneld"), 1);
-    tunneld daemon;
-    const bool started = tunneld_start(&daemon, options, stdout);
-    if (started)
-        tunneld_run(&daemon);
-    lc_log_close();
-    return started ? 0 : 1;
+    if (user_plane_settings.redirect_header && options.plane == "auto")
+        options.plane = "user";
+    return run_tunneld(options);
 }

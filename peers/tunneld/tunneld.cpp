@@ -1,260 +1,420 @@
-// The daemon's one thread. It looks at the mailbox each millisecond for a second after a command, since more
-// follow, less often the longer it has been quiet, and four times a second while there is no mailbox. wccpd
-// waits for two seconds, of which the longest pause takes a small part. The thread sleeps in sigtimedwait: a
-// signal ends it at once, and nothing else interrupts it.
+// The loop of the program and what it decides.
 //
-// wccpd gives a command up after two seconds: an add is then withdrawn, a delete or an L2 return is
-// overwritten by the next command. Therefore a command is checked again after it has been read and once more
-// before it is answered. One that is gone by then gets no answer, since that would be taken for the answer to
-// another, and an add that is gone is undone, since nobody knows its tunnel.
+// The mailbox is looked at each millisecond for a second after a command, since more follow, less often the
+// longer it has been quiet, and four times a second while there is none. wccpd waits for two seconds, of
+// which the longest pause takes a small part. Everything that is due now and then is done on the same timer.
 //
-// A tunnel's ends are its identity and its id a handle, as on wccpd's side: an add under another id, or under
-// an id whose delete was lost, replaces what was there.
-
+// A tunneld that is killed leaves its interfaces, routes and rules, and the next one takes them over. It
+// changes nothing, takes no command and therefore sends nobody's packets elsewhere, until it has read the
+// configuration.
+//
+// Requests to mgmtd wait by running the loop again from inside, therefore every callback here may run during
+// one.
 #include "peers/tunneld/tunneld.h"
 
 #include <arpa/inet.h>
+#include <ifaddrs.h>
+#include <net/if.h>
+#include <netinet/in.h>
 #include <signal.h>
 
+#include <algorithm>
 #include <ctime>
 
 #include <nlohmann/json.hpp>
 
+#include "peers/tunneld/kernel_state.h"
 #include "platform/tunnel_mailbox.h"
 #include "runtime/cmem.h"
+#include "runtime/common.h"
+#include "runtime/logging.h"
+#include "runtime/loop_host.h"
 #include "runtime/ttime.h"
 
 namespace {
 
-constexpr int64_t DETACHED_MS = 250, ROLES_EVERY_MS = 1000;
+constexpr uint32_t COMPONENT_TUNNELD = 257u << 16;
+constexpr int64_t RETRY_FIRST_MS = 1000, RETRY_MAX_MS = 30000;
+constexpr uint32_t ROLE_ACTIVE = 0;
 
-// The time to the next look at the mailbox, by the time since the last command or the start.
-int64_t pause_ms(int64_t quiet_ms) {
-    if (quiet_ms < 1000)
-        return 1;
-    return quiet_ms < 60000 ? 5 : 50;
-}
-
-sigset_t end_signals() {
-    sigset_t set;
-    sigemptyset(&set);
-    for (const int signal : {SIGTERM, SIGINT, SIGHUP})
-        sigaddset(&set, signal);
-    return set;
-}
-
-// True when one of the signals that end the daemon has come.
-bool sleep_or_end(int64_t ms) {
-    const sigset_t set = end_signals();
-    const timespec time = {ms / 1000, (ms % 1000) * 1000000};
-    return sigtimedwait(&set, nullptr, &time) > 0;
-}
-
-std::string address(uint32_t host_order) {
-    const in_addr wire = {htonl(host_order)};
-    char text[INET_ADDRSTRLEN];
-    return inet_ntop(AF_INET, &wire, text, sizeof text);
-}
-
-void print(tunneld *daemon, const nlohmann::ordered_json &line, const std::string &text) {
-    fprintf(daemon->out, "%s\n", daemon->options.json ? line.dump().c_str() : text.c_str());
-    fflush(daemon->out);
-}
-
-void print_command(tunneld *daemon, const tunneld_command &command, const std::string &result) {
-    if (command.code == MAILBOX_L2_RETURN) {
-        print(daemon,
-              {{"command", "l2_return"},
-               {"group", command.l2_group},
-               {"value", command.l2_value},
-               {"result", result}},
-              "L2 return group " + std::to_string(command.l2_group) + " value " +
-                  std::to_string(command.l2_value) + ": " + result);
-        return;
-    }
-    if (command.code != MAILBOX_ADD_TUNNEL && command.code != MAILBOX_DELETE_TUNNEL) {
-        print(daemon, {{"command", "unknown"}, {"code", command.code}, {"result", result}},
-              "unknown command " + std::to_string(command.code) + ": " + result);
-        return;
-    }
-    const std::string word = command.code == MAILBOX_ADD_TUNNEL ? "add" : "delete";
-    nlohmann::ordered_json line = {{"command", word},
-                                   {"tunnel_id", command.tunnel_id},
-                                   {"local", address(command.local)},
-                                   {"remote", address(command.remote)},
-                                   {"index", nullptr},
-                                   {"result", result},
-                                   {"tunnels", daemon->tunnels.size()}};
-    std::string index = "none";
-    if (command.index != WCCP_NO_INDEX) {
-        line["index"] = command.index;
-        index = std::to_string(command.index);
-    }
-    print(daemon, line,
-          word + " tunnel " + std::to_string(command.tunnel_id) + " " + address(command.local) + " <=> " +
-              address(command.remote) + " index " + index + ": " + result);
-}
-
-tunneld_command read_command(uint16_t code) {
-    tunneld_command command = {};
-    command.code = code;
-    if (code == MAILBOX_L2_RETURN) {
-        wccp_get_config_paramters(&command.l2_group, &command.l2_value);
-        return command;
-    }
-    mailbox_address local = {}, remote = {};
-    wccp_get_tunnel_parameters(&command.tunnel_id, &local, &remote, &command.index);
-    command.local = static_cast<uint32_t>(local.words[0]);
-    command.remote = static_cast<uint32_t>(remote.words[0]);
-    return command;
-}
-
-bool still_there(const tunneld_command &command) {
-    return wccp_get_tunnel_command() == command.code && read_command(command.code) == command &&
-           wccp_get_tunnel_command() == command.code;
-}
-
-// False when wccpd has given the command up: it gets no answer.
-bool answer(const tunneld_command &given, uint32_t index, uint32_t status) {
-    if (!still_there(given))
-        return false;
-    if (given.code != MAILBOX_L2_RETURN)
-        wccp_set_fmst_index(index);
-    return wccp_set_tunnel_command_status(status);
-}
-
-uint32_t take_index(tunneld *daemon) {
-    const uint32_t index = daemon->next_index;
-    if (index != WCCP_NO_INDEX && ++daemon->next_index == WCCP_NO_INDEX)
-        daemon->next_index = 1;
-    return index;
-}
-
-// The index of the tunnel, an old one where its ends and its id are known.
-uint32_t add(tunneld *daemon, const tunneld_command &command) {
-    for (auto it = daemon->tunnels.begin(); it != daemon->tunnels.end();) {
-        const bool same_id = it->first == command.tunnel_id;
-        const bool same_ends = it->second.local == command.local && it->second.remote == command.remote;
-        if (same_id && same_ends)
-            return it->second.index;
-        it = same_id || same_ends ? daemon->tunnels.erase(it) : std::next(it);
-    }
-    const uint32_t index = take_index(daemon);
-    if (index != WCCP_NO_INDEX)
-        daemon->tunnels[command.tunnel_id] = {command.local, command.remote, index};
-    return index;
-}
-
-// Carries the command out; the status that it is answered with.
-uint32_t carry_out(tunneld *daemon, const tunneld_command &command, uint32_t *out_index,
-                   const char **out_result) {
-    const auto found = daemon->tunnels.find(command.tunnel_id);
-    const bool known = found != daemon->tunnels.end() && found->second.local == command.local &&
-                       found->second.remote == command.remote;
-    *out_index = known ? found->second.index : WCCP_NO_INDEX;
-    *out_result = "refused";
-    if (daemon->options.refuse)
-        return 1;
-    *out_result = "done";
-    switch (command.code) {
-    case MAILBOX_ADD_TUNNEL:
-        *out_index = add(daemon, command);
-        if (*out_index == WCCP_NO_INDEX)
-            *out_result = "done, without an index";
-        return 0;
-    case MAILBOX_DELETE_TUNNEL:
-        if (!known) {
-            *out_result = "no such tunnel";
-            return 1;
-        }
-        daemon->tunnels.erase(found);
-        return 0;
-    case MAILBOX_L2_RETURN:
-        return 0;
-    default:
-        *out_result = "refused";
-        return 1;
-    }
-}
-
-void print_roles(tunneld *daemon) {
-    static const char *const words[] = {"ACTIVE", "BACKUP", "UNKNOWN"};
-    for (uint32_t i = 0; i < WCCP_POLICY_GROUPS; i++) {
-        const auto group = static_cast<uint16_t>(i);
-        const uint32_t role = wccp_get_role(group);
-        const auto known = daemon->roles.find(group);
-        if (role == (known == daemon->roles.end() ? 2 : known->second))
+std::vector<uint32_t> find_own_addresses() {
+    std::vector<uint32_t> out;
+    ifaddrs *list = nullptr;
+    if (getifaddrs(&list) != 0)
+        return out;
+    for (const ifaddrs *entry = list; entry; entry = entry->ifa_next) {
+        if (!entry->ifa_addr || entry->ifa_addr->sa_family != AF_INET || (entry->ifa_flags & IFF_LOOPBACK))
             continue;
-        if (role == 2)
-            daemon->roles.erase(group);
-        else
-            daemon->roles[group] = role;
-        const std::string word = role < 3 ? words[role] : std::to_string(role);
-        print(daemon, {{"policy_group", group}, {"role", word}},
-              "policy group " + std::to_string(group) + " role " + word);
+        const auto *address = reinterpret_cast<const sockaddr_in *>(entry->ifa_addr);
+        out.push_back(ntohl(address->sin_addr.s_addr));
+    }
+    freeifaddrs(list);
+    std::sort(out.begin(), out.end());
+    return out;
+}
+
+// --- What follows from what is known
+
+bool is_active(const tunneld &daemon, uint8_t group) {
+    const auto found = daemon.configured.groups.find(group);
+    if (found == daemon.configured.groups.end() || found->second.policy_group == 0)
+        return true;
+    const auto role = daemon.roles.find(found->second.policy_group);
+    return role != daemon.roles.end() && role->second;
+}
+
+// Before its first check a proxy counts as up, as it was under the tunneld before; a gateway that fails
+// closed takes no chances.
+bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules) {
+    const auto &states = health_states(daemon.health);
+    const auto found = states.find(group);
+    if (found == states.end() || found->second.state == proxy_health::unknown)
+        return !rules.drop_when_down;
+    return found->second.state == proxy_health::up;
+}
+
+appliance_view view_appliance(const tunneld &daemon) {
+    appliance_view view;
+    for (const auto &[id, tunnel] : daemon.desk.tunnels)
+        view.tunnels[id] = {tunnel.local, tunnel.remote};
+    view.groups = daemon.configured.groups;
+    for (const auto &[group, forced] : daemon.forced_l2)
+        if (const auto found = view.groups.find(group); found != view.groups.end())
+            found->second.force_l2_return = forced;
+    view.intercepts = daemon.configured.intercepts;
+    for (const auto &[group, rules] : view.intercepts)
+        view.conditions[group] = {is_proxy_up(daemon, group, rules), is_active(daemon, group)};
+    const int64_t now = time(nullptr);
+    for (const bypass_entry &entry : daemon.configured.bypasses)
+        if (entry.until == 0 || entry.until > now)
+            view.bypasses.push_back(entry);
+    view.accepted = daemon.configured.accepted;
+    view.own_addresses = daemon.own_addresses;
+    return view;
+}
+
+void report_failure(tunneld *daemon, const std::string &error) {
+    if (!error.empty()) {
+        daemon->retry_delay_ms = std::clamp(daemon->retry_delay_ms * 2, RETRY_FIRST_MS, RETRY_MAX_MS);
+        daemon->retry_at_ms = lt_monotonic_ms() + daemon->retry_delay_ms;
+        if (error != daemon->failure)
+            LC_LOG(LC_LOG_ERR, "The kernel is not as wanted: %s", error.c_str());
+    } else if (!daemon->failure.empty()) {
+        LC_LOG(LC_LOG_NOTICE, "The kernel is as wanted again");
+        daemon->retry_delay_ms = 0;
+    }
+    daemon->failure = error;
+}
+
+void reconcile(tunneld *daemon) {
+    if (daemon->plane == &table_plane)
+        return;
+    wanted_state wanted =
+        make_wanted_state(view_appliance(*daemon), daemon->links, daemon->plane == &user_plane);
+    const bool again = !daemon->failure.empty() && lt_monotonic_ms() >= daemon->retry_at_ms;
+    if (daemon->applied == wanted && !again)
+        return;
+    std::string error;
+    (void)reconcile_kernel_state(*daemon->plane, wanted, &daemon->indices, &error);
+    report_failure(daemon, error);
+    daemon->links = wanted.links;
+    daemon->applied = std::move(wanted);
+}
+
+// What the table of commands asks for.
+void apply_tunnels(tunneld *daemon, std::map<uint16_t, command_tunnel> *tunnels) {
+    reconcile(daemon);
+    for (auto &[id, tunnel] : *tunnels)
+        for (const wanted_link &link : daemon->links)
+            if (const auto index = daemon->indices.find(link.name);
+                !link.wish.accepted && link.wish.local == tunnel.local && link.wish.remote == tunnel.remote &&
+                index != daemon->indices.end())
+                tunnel.index = index->second;
+}
+
+// --- Health
+
+void follow_health(tunneld *daemon) {
+    const int64_t now = lt_monotonic_ms();
+    const auto &states = health_states(daemon->health);
+    for (const auto &[group, rules] : daemon->configured.intercepts) {
+        const auto state = states.find(group);
+        if (state == states.end() || state->second.state == proxy_health::unknown)
+            continue;
+        if (state->second.state == proxy_health::up) {
+            const auto outage = daemon->outages.find(group);
+            if (outage == daemon->outages.end())
+                continue;
+            if (outage->second.left) {
+                LC_LOG(LC_LOG_NOTICE, "Group %d joins its routers again: the proxy is up", group);
+                mgmt_link_group_joins(daemon->management, group);
+            }
+            daemon->outages.erase(outage);
+            continue;
+        }
+        outage &down = daemon->outages.try_emplace(group, outage{now, false}).first->second;
+        if (down.left || rules.leave_after_s == 0 ||
+            now - down.since_ms < int64_t{rules.leave_after_s} * 1000)
+            continue;
+        down.left = true;
+        LC_LOG(LC_LOG_WARNING, "Group %d leaves its routers: the proxy has been down for %u s: %s", group,
+               rules.leave_after_s, state->second.reason.c_str());
+        mgmt_link_group_leaves(daemon->management, group, "proxy down: " + state->second.reason);
     }
 }
 
-// One look. `*out_end` is set when a signal came while the command was under way.
-bool step(tunneld *daemon, bool *out_end) {
-    const uint16_t code = wccp_get_tunnel_command();
-    if (!daemon->attached && wccp_mailbox) {
-        daemon->attached = true;
-        print(daemon, {{"event", "attached"}}, "attached to the mailbox");
+// To a mgmtd that may have heard other things from the tunneld before.
+void report_outages(tunneld *daemon) {
+    const auto &states = health_states(daemon->health);
+    for (const auto &[group, state] : states) {
+        const auto outage = daemon->outages.find(group);
+        if (outage != daemon->outages.end() && outage->second.left)
+            mgmt_link_group_leaves(daemon->management, group, "proxy down: " + state.reason);
+        else if (state.state == proxy_health::up)
+            mgmt_link_group_joins(daemon->management, group);
     }
-    if (code == MAILBOX_IDLE) {
-        daemon->passed_over.reset();
+}
+
+void proxy_changed(tunneld *daemon, uint8_t group) {
+    const auto &states = health_states(daemon->health);
+    const auto found = states.find(group);
+    if (found == states.end() || found->second.state == proxy_health::unknown)
+        return;
+    const bool up = found->second.state == proxy_health::up;
+    LC_LOG(up ? LC_LOG_NOTICE : LC_LOG_WARNING, "Group %d: the proxy is %s%s%s", group, up ? "up" : "down",
+           up ? "" : ": ", up ? "" : found->second.reason.c_str());
+    mgmt_link_proxy_changed(daemon->management, group, up, found->second.reason);
+    if (up && !daemon->outages.contains(group))
+        mgmt_link_group_joins(daemon->management, group);
+    follow_health(daemon);
+    reconcile(daemon);
+}
+
+// --- Configuration and roles
+
+void read_roles(tunneld *daemon) {
+    std::map<uint16_t, bool> roles;
+    for (const auto &[group, rules] : daemon->configured.intercepts)
+        if (const auto found = daemon->configured.groups.find(group);
+            found != daemon->configured.groups.end() && found->second.policy_group != 0)
+            roles[found->second.policy_group] = wccp_get_role(found->second.policy_group) == ROLE_ACTIVE;
+    daemon->roles = std::move(roles);
+}
+
+void take_configuration(tunneld *daemon, const configured_view &view) {
+    daemon->configured = view;
+    daemon->configured_once = true;
+    daemon->own_addresses = find_own_addresses();
+    for (auto it = daemon->outages.begin(); it != daemon->outages.end();) {
+        if (view.intercepts.contains(it->first)) {
+            ++it;
+            continue;
+        }
+        mgmt_link_group_joins(daemon->management, it->first);
+        it = daemon->outages.erase(it);
+    }
+    std::erase_if(daemon->forced_l2, [&](const auto &entry) { return !view.groups.contains(entry.first); });
+    health_set_checks(daemon->health, view.intercepts);
+    read_roles(daemon);
+    report_outages(daemon);
+    reconcile(daemon);
+    daemon->last_command_ms = lt_monotonic_ms(); // commands may follow
+}
+
+// --- wccpd's comings and goings
+
+void watch_wccpd(tunneld *daemon, int64_t now) {
+    bool lives = false;
+    const int32_t pid = cmem_find_creator(WCCP_MAILBOX_NAME, &lives);
+    if (pid == 0 || !lives || pid == daemon->wccpd_pid)
+        return;
+    // The mailbox of a wccpd that has ordered nothing yet holds no index.
+    const bool fresh = daemon->wccpd_pid != 0 || wccp_get_fmst_index() == WCCP_NO_INDEX;
+    daemon->wccpd_pid = pid;
+    if (daemon->desk.tunnels.empty())
+        return;
+    if (!fresh) {
+        for (const auto &[id, tunnel] : daemon->desk.tunnels)
+            daemon->desk.ordered[id] = true;
+        return;
+    }
+    LC_LOG(LC_LOG_NOTICE, "wccpd has been started anew: %zu tunnels wait to be ordered again",
+           daemon->desk.tunnels.size());
+    daemon->desk.ordered.clear();
+    daemon->unordered_until_ms = now + UNORDERED_MS;
+}
+
+void drop_unordered(tunneld *daemon, int64_t now) {
+    if (daemon->unordered_until_ms < 0 || now < daemon->unordered_until_ms)
+        return;
+    daemon->unordered_until_ms = -1;
+    const size_t dropped = std::erase_if(daemon->desk.tunnels, [&](const auto &tunnel) {
+        return !daemon->desk.ordered.contains(tunnel.first);
+    });
+    if (dropped)
+        LC_LOG(LC_LOG_NOTICE, "%zu tunnels that wccpd has not ordered again are removed", dropped);
+    reconcile(daemon);
+}
+
+// --- The loop
+
+void tick(tunneld *daemon, int64_t now) {
+    watch_wccpd(daemon, now);
+    drop_unordered(daemon, now);
+    if (daemon->desk.options.roles && daemon->desk.attached)
+        print_roles(&daemon->desk);
+    read_roles(daemon);
+    follow_health(daemon);
+    daemon->own_addresses = find_own_addresses();
+    reconcile(daemon);
+}
+
+bool takes_over_still(const tunneld &daemon, int64_t now) {
+    return !daemon.configured_once && !daemon.desk.tunnels.empty() &&
+           now - daemon.started_ms < TAKE_OVER_WAIT_MS;
+}
+
+void look_at_mailbox(int, short, void *data) {
+    auto *daemon = static_cast<tunneld *>(data);
+    const int64_t now = lt_monotonic_ms();
+    bool end = false;
+    int64_t pause = 5;
+    if (!takes_over_still(*daemon, now)) {
+        // In the order in which a command could change what the other reads.
+        if (now >= daemon->tick_at_ms) {
+            daemon->tick_at_ms = now + TICK_MS;
+            tick(daemon, now);
+        }
+        if (take_command(&daemon->desk, &end))
+            daemon->last_command_ms = now;
+        pause = mailbox_pause_ms(daemon->desk.attached, now - daemon->last_command_ms);
+    }
+    LOG_STATUS(loop_event_set_timer(daemon->mailbox_timer, pause));
+}
+
+lc_status take_signal(int number, short, void *, lew *loop) {
+    LC_LOG(LC_LOG_INFO, "Received %s", lc_signal_num_to_name(number));
+    return lew_escape_from_dispatch(loop);
+}
+
+// --- Start and end
+
+bool choose_plane(tunneld *daemon) {
+    std::string reasons;
+    for (const data_plane *plane : data_planes) {
+        if (daemon->options.plane == "auto" ? plane == &table_plane : daemon->options.plane != plane->name)
+            continue;
+        std::string why_not;
+        if (plane->probe(&why_not) && plane->open(&why_not)) {
+            daemon->plane = plane;
+            break;
+        }
+        reasons += (reasons.empty() ? "" : "; ") + std::string(plane->name) + ": " + why_not;
+    }
+    daemon->plane_reason = reasons;
+    if (!daemon->plane) {
+        fprintf(stderr, "tunneld: no data plane works here: %s\n", reasons.c_str());
+        LC_LOG(LC_LOG_ERR, "No data plane works here: %s", reasons.c_str());
         return false;
     }
-    tunneld_command command = read_command(code);
-    if (wccp_get_tunnel_command() != code)
-        return true;
-    if (daemon->options.silent) {
-        if (daemon->passed_over != command)
-            print_command(daemon, command, "not answered");
-        daemon->passed_over = command;
-        return false;
-    }
-    const tunneld_command given = command;
-    const auto before = daemon->tunnels;
-    const char *result;
-    const uint32_t status = carry_out(daemon, command, &command.index, &result);
-    *out_end = daemon->options.slow_ms && sleep_or_end(daemon->options.slow_ms);
-    if (!answer(given, command.index, status)) {
-        if (code == MAILBOX_ADD_TUNNEL)
-            daemon->tunnels = before;
-        result = "withdrawn";
-    }
-    print_command(daemon, command, result);
+    LC_LOG(LC_LOG_NOTICE, "Data plane: %s%s%s", daemon->plane->name,
+           reasons.empty() ? "" : "; not used: ", reasons.c_str());
+    print_line(daemon->desk, {{"event", "plane"}, {"name", daemon->plane->name}, {"not_used", reasons}},
+               std::string("data plane ") + daemon->plane->name +
+                   (reasons.empty() ? "" : " (not used: " + reasons + ")"));
     return true;
+}
+
+// Takes over what a killed tunneld has left.
+void take_over(tunneld *daemon) {
+    daemon->links = find_own_links();
+    for (const wanted_link &link : daemon->links) {
+        uint32_t index = 0;
+        std::string error;
+        if (!daemon->plane->make_link(link.name, link.wish, &index, &error)) {
+            LC_LOG(LC_LOG_WARNING, "%s is not taken over: %s", link.name.c_str(), error.c_str());
+            continue;
+        }
+        daemon->indices[link.name] = index;
+        if (!link.wish.accepted)
+            daemon->desk.tunnels[link.wish.tunnel_id] = {link.wish.local, link.wish.remote, index};
+    }
+    if (!daemon->links.empty())
+        LC_LOG(LC_LOG_NOTICE, "%zu tunnels are taken over", daemon->desk.tunnels.size());
+}
+
+void start_plane(tunneld *daemon) {
+    daemon->lack = probe_sorting_rules();
+    if (!daemon->lack.empty())
+        LC_LOG(LC_LOG_ERR, "Packets cannot be sorted, therefore all are returned: %s", daemon->lack.c_str());
+    daemon->desk.apply = [daemon](std::map<uint16_t, command_tunnel> *tunnels) {
+        apply_tunnels(daemon, tunnels);
+    };
+    daemon->desk.set_l2_return = [daemon](uint8_t group, bool forced) {
+        daemon->forced_l2[group] = forced;
+        reconcile(daemon);
+    };
+    take_over(daemon);
+}
+
+bool start_parts(tunneld *daemon) {
+    loop_context *context = nullptr;
+    if (lew_init(&daemon->loop) != LC_OK || lew_get_event_context(daemon->loop, &context) != LC_OK ||
+        loop_event_new(context, look_at_mailbox, daemon, &daemon->mailbox_timer) != LC_OK)
+        return false;
+    static lew_event *slots[3];
+    size_t taken = 0;
+    for (const int number : {SIGTERM, SIGINT, SIGHUP})
+        if (lew_event_reg_signal(daemon->loop, &slots[taken++], number, take_signal, nullptr) != LC_OK)
+            return false;
+    if (!start_commands(&daemon->desk, daemon->options.commands, stdout) || !choose_plane(daemon))
+        return false;
+    daemon->health = health_new(context, [daemon](uint8_t group) { proxy_changed(daemon, group); });
+    if (!daemon->health)
+        return false;
+    if (daemon->plane != &table_plane)
+        start_plane(daemon);
+    daemon->management = mgmt_link_new(
+        daemon->loop, {[daemon](const configured_view &view) { take_configuration(daemon, view); },
+                       [daemon] { return tunneld_state(*daemon); }});
+    return daemon->management != nullptr;
+}
+
+void end_parts(tunneld *daemon) {
+    if (daemon->management)
+        mgmt_link_free(daemon->management);
+    if (daemon->health)
+        health_free(daemon->health);
+    std::string error;
+    if (daemon->plane && daemon->plane != &table_plane && !remove_kernel_state(*daemon->plane, &error))
+        LC_LOG(LC_LOG_ERR, "Not everything could be removed from the kernel: %s", error.c_str());
+    if (daemon->plane)
+        daemon->plane->close();
+    if (daemon->mailbox_timer)
+        loop_event_free(&daemon->mailbox_timer);
+    if (daemon->loop) {
+        (void)lew_delete_all_events(daemon->loop);
+        (void)lew_deinit(&daemon->loop);
+    }
 }
 
 } // namespace
 
-bool tunneld_start(tunneld *daemon, const tunneld_options &options, FILE *out) {
-    daemon->options = options;
-    daemon->out = out;
-    daemon->next_index = options.first_index;
-    return cmem_attach_registry(); // through which the mailbox is found once wccpd has created it
-}
-
-bool tunneld_step(tunneld *daemon) {
-    bool end = false;
-    return step(daemon, &end);
-}
-
-void tunneld_run(tunneld *daemon) {
-    int64_t last_command = lt_monotonic_ms(), roles_at = 0;
-    for (bool end = false; !end;) {
-        const int64_t now = lt_monotonic_ms();
-        if (step(daemon, &end)) {
-            last_command = now;
-            continue;
-        }
-        if (daemon->options.roles && daemon->attached && now >= roles_at) {
-            print_roles(daemon);
-            roles_at = now + ROLES_EVERY_MS;
-        }
-        end = sleep_or_end(daemon->attached ? pause_ms(now - last_command) : DETACHED_MS);
+int run_tunneld(const tunneld_options &options) {
+    lc_init();
+    lc_log_init("tunneld", nullptr, 0, COMPONENT_TUNNELD, LC_LOG_INFO,
+                lc_log_get_facility(nullptr, "tunneld"), 1);
+    signal(SIGPIPE, SIG_IGN);
+    tunneld daemon;
+    daemon.options = options;
+    daemon.desk.options = options.commands;
+    daemon.started_ms = daemon.last_command_ms = lt_monotonic_ms();
+    bool good = start_parts(&daemon);
+    if (good) {
+        look_at_mailbox(-1, 0, &daemon);
+        good = lew_dispatch(daemon.loop, nullptr, nullptr) == LC_OK;
     }
+    end_parts(&daemon);
+    lc_log_close();
+    return good ? 0 : 1;
 }

@@ -1,50 +1,71 @@
-// tunneld: the tunnel daemon of the appliance, as far as wccpd sees it. It takes commands from the mailbox,
-// answers them with indices of its own, keeps a table of its tunnels and prints each command.
+// tunneld: composes its parts. Commands and roles come from the mailbox, the configuration from mgmtd, the
+// health of proxies from checks; what follows from these for the kernel is computed anew after each change,
+// and reconciled. One thread with a loop; the user-space data plane has one of its own.
 #pragma once
 
 #include <cstdint>
-#include <cstdio>
 #include <map>
 #include <optional>
+#include <set>
 #include <string>
+#include <vector>
+
+#include "peers/tunneld/commands.h"
+#include "peers/tunneld/health.h"
+#include "peers/tunneld/plane.h"
+#include "peers/tunneld/session.h"
+#include "peers/tunneld/sorting_rules.h"
+#include "peers/tunneld/wanted_state.h"
+
+constexpr int64_t TICK_MS = 1000;
+// What a killed tunneld has left stays as it is until the configuration has been read, so long at most.
+constexpr int64_t TAKE_OVER_WAIT_MS = 1500;
+// Tunnels that a new wccpd does not order go after this time.
+constexpr int64_t UNORDERED_MS = 60000;
 
 struct tunneld_options {
-    uint32_t first_index = 1; // index of the first tunnel, rising from there; WCCP_NO_INDEX gives none to any
-    uint32_t slow_ms = 0;     // time that a command takes
-    bool refuse = false;      // every command fails
-    bool silent = false;      // no command is answered
-    bool json = false;        // one JSON object a line
-    bool roles = false;       // changes of policy group roles are printed too
+    command_options commands;
+    std::string plane = "auto"; // or the name of one
 };
 
-struct tunneld_tunnel {
-    uint32_t local, remote; // host order
-    uint32_t index;
-};
-
-// A command as it stood in the mailbox.
-struct tunneld_command {
-    uint16_t code;
-    uint16_t tunnel_id;
-    uint32_t local, remote, index;
-    uint8_t l2_group;
-    uint32_t l2_value;
-    bool operator==(const tunneld_command &) const = default;
+// An intercept whose proxy is down.
+struct outage {
+    int64_t since_ms; // monotonic
+    bool left;        // the group has left its routers because of it
 };
 
 struct tunneld {
     tunneld_options options;
-    FILE *out = stdout;
-    bool attached = false;
-    uint32_t next_index = 0;
-    std::map<uint16_t, tunneld_tunnel> tunnels; // by tunnel id
-    std::optional<tunneld_command> passed_over; // the command that is left unanswered, printed once
-    std::map<uint16_t, uint32_t> roles;         // of policy groups, where not UNKNOWN
+    command_desk desk;
+    const data_plane *plane = nullptr;
+    std::string plane_reason; // why no plane before it in the table could be used
+    std::string lack;         // what the kernel lacks for sorting packets, or ""
+
+    lew *loop = nullptr;
+    loop_event *mailbox_timer = nullptr;
+    mgmt_link *management = nullptr;
+    health_monitor *health = nullptr;
+
+    configured_view configured;
+    bool configured_once = false;
+    int64_t started_ms = 0;
+    int64_t tick_at_ms = 0, last_command_ms = 0;
+    std::map<uint8_t, bool> forced_l2; // by command, which wins over the configuration
+    std::map<uint16_t, bool> roles;    // of the policy groups of groups with an intercept: ACTIVE
+    std::map<uint8_t, outage> outages;
+    std::vector<uint32_t> own_addresses;
+
+    int32_t wccpd_pid = 0;           // that the tunnels were ordered by
+    int64_t unordered_until_ms = -1; // -1: no tunnel waits to be ordered anew
+
+    std::vector<wanted_link> links; // that are there, or were wanted last
+    std::optional<wanted_state> applied;
+    std::map<std::string, uint32_t> indices; // of the links
+    std::string failure;                     // of the last reconciling, or ""
+    int64_t retry_at_ms = -1, retry_delay_ms = 0;
 };
 
-// False, with a line in the log, when shared memory cannot be used.
-bool tunneld_start(tunneld *daemon, const tunneld_options &options, FILE *out);
-// Takes the pending command, if there is one. False when there was nothing to do.
-bool tunneld_step(tunneld *daemon);
-// Until SIGTERM, SIGINT or SIGHUP, which the caller has blocked.
-void tunneld_run(tunneld *daemon);
+// The program, until a signal ends it. The exit code.
+int run_tunneld(const tunneld_options &options);
+// The state nodes, in the order of a walk.
+std::vector<state_node> tunneld_state(const tunneld &daemon);

@@ -1,0 +1,240 @@
+// wccpd gives a command up after two seconds: an add is then withdrawn, a delete or an L2 return is
+// overwritten by the next command. Therefore a command is checked again after it has been read and once more
+// before it is answered. One that is gone by then gets no answer, since that would be taken for the answer to
+// another, and an add that is gone is undone, since nobody knows its tunnel.
+//
+// A tunnel's ends are its identity and its id a handle, as on wccpd's side: an add under another id, or under
+// an id whose delete was lost, replaces what was there.
+#include "peers/tunneld/commands.h"
+
+#include <arpa/inet.h>
+
+#include <cerrno>
+#include <ctime>
+
+#include <nlohmann/json.hpp>
+
+#include "platform/tunnel_mailbox.h"
+#include "runtime/cmem.h"
+
+namespace {
+
+// True when a signal has cut the sleep short.
+bool sleep_or_end(int64_t ms) {
+    const timespec time = {ms / 1000, (ms % 1000) * 1000000};
+    return nanosleep(&time, nullptr) != 0 && errno == EINTR;
+}
+
+void print_command(const command_desk &desk, const mailbox_command &command, const std::string &result) {
+    if (command.code == MAILBOX_L2_RETURN) {
+        print_line(desk,
+                   {{"command", "l2_return"},
+                    {"group", command.l2_group},
+                    {"value", command.l2_value},
+                    {"result", result}},
+                   "L2 return group " + std::to_string(command.l2_group) + " value " +
+                       std::to_string(command.l2_value) + ": " + result);
+        return;
+    }
+    if (command.code != MAILBOX_ADD_TUNNEL && command.code != MAILBOX_DELETE_TUNNEL) {
+        print_line(desk, {{"command", "unknown"}, {"code", command.code}, {"result", result}},
+                   "unknown command " + std::to_string(command.code) + ": " + result);
+        return;
+    }
+    const std::string word = command.code == MAILBOX_ADD_TUNNEL ? "add" : "delete";
+    nlohmann::ordered_json line = {{"command", word},
+                                   {"tunnel_id", command.tunnel_id},
+                                   {"local", address_text(command.local)},
+                                   {"remote", address_text(command.remote)},
+                                   {"index", nullptr},
+                                   {"result", result},
+                                   {"tunnels", desk.tunnels.size()}};
+    std::string index = "none";
+    if (command.index != WCCP_NO_INDEX) {
+        line["index"] = command.index;
+        index = std::to_string(command.index);
+    }
+    print_line(desk, line,
+               word + " tunnel " + std::to_string(command.tunnel_id) + " " + address_text(command.local) +
+                   " <=> " + address_text(command.remote) + " index " + index + ": " + result);
+}
+
+mailbox_command read_command(uint16_t code) {
+    mailbox_command command = {};
+    command.code = code;
+    if (code == MAILBOX_L2_RETURN) {
+        wccp_get_config_paramters(&command.l2_group, &command.l2_value);
+        return command;
+    }
+    mailbox_address local = {}, remote = {};
+    wccp_get_tunnel_parameters(&command.tunnel_id, &local, &remote, &command.index);
+    command.local = static_cast<uint32_t>(local.words[0]);
+    command.remote = static_cast<uint32_t>(remote.words[0]);
+    return command;
+}
+
+bool still_there(const mailbox_command &command) {
+    return wccp_get_tunnel_command() == command.code && read_command(command.code) == command &&
+           wccp_get_tunnel_command() == command.code;
+}
+
+// False when wccpd has given the command up: it gets no answer.
+bool answer(const mailbox_command &given, uint32_t index, uint32_t status) {
+    if (!still_there(given))
+        return false;
+    if (given.code != MAILBOX_L2_RETURN)
+        wccp_set_fmst_index(index);
+    return wccp_set_tunnel_command_status(status);
+}
+
+uint32_t take_index(command_desk *desk) {
+    const uint32_t index = desk->next_index;
+    if (index != WCCP_NO_INDEX && ++desk->next_index == WCCP_NO_INDEX)
+        desk->next_index = 1;
+    return index;
+}
+
+void apply_table(command_desk *desk) {
+    if (desk->apply)
+        desk->apply(&desk->tunnels);
+}
+
+// The index of the tunnel, an old one where its ends and its id are known; WCCP_NO_INDEX when there is none.
+uint32_t add(command_desk *desk, const mailbox_command &command) {
+    for (auto it = desk->tunnels.begin(); it != desk->tunnels.end();) {
+        const bool same_id = it->first == command.tunnel_id;
+        const bool same_ends = it->second.local == command.local && it->second.remote == command.remote;
+        if (same_id && same_ends)
+            return it->second.index;
+        it = same_id || same_ends ? desk->tunnels.erase(it) : std::next(it);
+    }
+    desk->tunnels[command.tunnel_id] = {command.local, command.remote, WCCP_NO_INDEX};
+    apply_table(desk);
+    if (!desk->apply)
+        desk->tunnels[command.tunnel_id].index = take_index(desk);
+    const uint32_t index = desk->tunnels[command.tunnel_id].index;
+    if (index == WCCP_NO_INDEX) {
+        desk->tunnels.erase(command.tunnel_id);
+        apply_table(desk);
+    }
+    return index;
+}
+
+// Carries the command out; the status that it is answered with.
+uint32_t carry_out(command_desk *desk, const mailbox_command &command, uint32_t *out_index,
+                   const char **out_result) {
+    const auto found = desk->tunnels.find(command.tunnel_id);
+    const bool known = found != desk->tunnels.end() && found->second.local == command.local &&
+                       found->second.remote == command.remote;
+    *out_index = known ? found->second.index : WCCP_NO_INDEX;
+    *out_result = "refused";
+    if (desk->options.refuse)
+        return 1;
+    *out_result = "done";
+    switch (command.code) {
+    case MAILBOX_ADD_TUNNEL:
+        *out_index = add(desk, command);
+        desk->ordered[command.tunnel_id] = true;
+        if (*out_index == WCCP_NO_INDEX)
+            *out_result = "done, without an index";
+        return 0;
+    case MAILBOX_DELETE_TUNNEL:
+        if (!known) {
+            *out_result = "no such tunnel";
+            return 1;
+        }
+        desk->tunnels.erase(found);
+        desk->ordered.erase(command.tunnel_id);
+        apply_table(desk);
+        return 0;
+    case MAILBOX_L2_RETURN:
+        if (desk->set_l2_return)
+            desk->set_l2_return(command.l2_group, command.l2_value != 0);
+        return 0;
+    default:
+        *out_result = "refused";
+        return 1;
+    }
+}
+
+} // namespace
+
+void print_roles(command_desk *desk) {
+    static const char *const words[] = {"ACTIVE", "BACKUP", "UNKNOWN"};
+    for (uint32_t i = 0; i < WCCP_POLICY_GROUPS; i++) {
+        const auto group = static_cast<uint16_t>(i);
+        const uint32_t role = wccp_get_role(group);
+        const auto known = desk->roles.find(group);
+        if (role == (known == desk->roles.end() ? 2 : known->second))
+            continue;
+        if (role == 2)
+            desk->roles.erase(group);
+        else
+            desk->roles[group] = role;
+        const std::string word = role < 3 ? words[role] : std::to_string(role);
+        print_line(*desk, {{"policy_group", group}, {"role", word}},
+                   "policy group " + std::to_string(group) + " role " + word);
+    }
+}
+
+bool take_command(command_desk *desk, bool *out_end) {
+    *out_end = false;
+    const uint16_t code = wccp_get_tunnel_command();
+    if (!desk->attached && wccp_mailbox) {
+        desk->attached = true;
+        print_line(*desk, {{"event", "attached"}}, "attached to the mailbox");
+    }
+    if (code == MAILBOX_IDLE) {
+        desk->passed_over.reset();
+        return false;
+    }
+    mailbox_command command = read_command(code);
+    if (wccp_get_tunnel_command() != code)
+        return true;
+    if (desk->options.silent) {
+        if (desk->passed_over != command)
+            print_command(*desk, command, "not answered");
+        desk->passed_over = command;
+        return false;
+    }
+    const mailbox_command given = command;
+    const auto before = desk->tunnels;
+    const char *result;
+    const uint32_t status = carry_out(desk, command, &command.index, &result);
+    *out_end = desk->options.slow_ms && sleep_or_end(desk->options.slow_ms);
+    if (!answer(given, command.index, status)) {
+        if (code == MAILBOX_ADD_TUNNEL) {
+            desk->tunnels = before;
+            apply_table(desk);
+        }
+        result = "withdrawn";
+    }
+    print_command(*desk, command, result);
+    return true;
+}
+
+std::string address_text(uint32_t host_order) {
+    const in_addr wire = {htonl(host_order)};
+    char text[INET_ADDRSTRLEN];
+    return inet_ntop(AF_INET, &wire, text, sizeof text);
+}
+
+void print_line(const command_desk &desk, const nlohmann::ordered_json &line, const std::string &text) {
+    fprintf(desk.out, "%s\n", desk.options.json ? line.dump().c_str() : text.c_str());
+    fflush(desk.out);
+}
+
+int64_t mailbox_pause_ms(bool attached, int64_t quiet_ms) {
+    if (!attached)
+        return 250;
+    if (quiet_ms < 1000)
+        return 1;
+    return quiet_ms < 60000 ? 5 : 60;
+}
+
+bool start_commands(command_desk *desk, const command_options &options, FILE *out) {
+    desk->options = options;
+    desk->out = out;
+    desk->next_index = options.first_index;
+    return cmem_attach_registry(); // through which the mailbox is found once wccpd has created it
+}

@@ -1,0 +1,133 @@
+// The state nodes that tunneld answers for.
+#include <algorithm>
+
+#include "mgmt/bnode_types.h"
+#include "mgmt/node_paths.h"
+#include "peers/tunneld/tunneld.h"
+#include "runtime/ttime.h"
+
+namespace {
+
+struct node_writer {
+    std::vector<state_node> *out;
+    std::string above;
+    void add(const std::string &name, uint32_t type, const std::string &text) {
+        out->push_back({above + "/" + name, type, text});
+    }
+    void count(const std::string &name, uint64_t value) { add(name, bn_type_uint64, std::to_string(value)); }
+};
+
+void add_sorted(node_writer *writer, const packet_count *ways) {
+    for (size_t way = 0; way < SORTED_WAYS; way++) {
+        writer->count(sorted_words[way], ways[way].packets);
+        writer->count(std::string(sorted_words[way]) + "_bytes", ways[way].bytes);
+    }
+}
+
+void add_refused(node_writer *writer, const uint64_t *refused) {
+    for (size_t reason = 0; reason < REFUSALS; reason++)
+        writer->count(std::string("refused/") + refusal_words[reason], refused[reason]);
+}
+
+void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorting_counters &sorting,
+                 std::vector<state_node> *out) {
+    for (const wanted_link &link : daemon.links) {
+        const auto index = daemon.indices.find(link.name);
+        if (link.wish.accepted || index == daemon.indices.end())
+            continue;
+        const std::string id = std::to_string(link.wish.tunnel_id);
+        node_writer writer = {out, std::string(NODE_TUNNEL_STATE) + "/" + id};
+        out->push_back({writer.above, bn_type_uint16, id});
+        writer.add("local", bn_type_ipv4addr, address_text(link.wish.local));
+        writer.add("remote", bn_type_ipv4addr, address_text(link.wish.remote));
+        writer.add("interface", bn_type_str, link.name);
+        writer.add("index", bn_type_uint32, std::to_string(index->second));
+        // Packets of its further sources count with the tunnel that they are accepted beside.
+        link_counters sum;
+        packet_count ways[SORTED_WAYS];
+        uint64_t fragments = 0;
+        for (const wanted_link &each : daemon.links) {
+            if (each.wish.tunnel_id != link.wish.tunnel_id)
+                continue;
+            if (const auto found = plane.links.find(each.name); found != plane.links.end()) {
+                sum.packets_in += found->second.packets_in;
+                sum.bytes_in += found->second.bytes_in;
+                sum.packets_out += found->second.packets_out;
+                sum.bytes_out += found->second.bytes_out;
+                for (size_t i = 0; i < REFUSALS; i++)
+                    sum.refused[i] += found->second.refused[i];
+            }
+            if (const auto found = sorting.interfaces.find(each.name); found != sorting.interfaces.end())
+                for (size_t i = 0; i < SORTED_WAYS; i++) {
+                    ways[i].packets += found->second[i].packets;
+                    ways[i].bytes += found->second[i].bytes;
+                }
+            if (const auto found = sorting.fragments.find({each.wish.local, each.wish.remote});
+                found != sorting.fragments.end())
+                fragments += found->second;
+        }
+        writer.count("packets_in", sum.packets_in);
+        writer.count("bytes_in", sum.bytes_in);
+        writer.count("packets_out", sum.packets_out);
+        writer.count("bytes_out", sum.bytes_out);
+        writer.count("fragments", fragments);
+        add_refused(&writer, sum.refused);
+        add_sorted(&writer, ways);
+    }
+}
+
+void add_intercepts(const tunneld &daemon, const sorting_counters &sorting, std::vector<state_node> *out) {
+    static const char *const words[] = {"unknown", "up", "down"};
+    const auto &states = health_states(daemon.health);
+    const int64_t now = lt_monotonic_ms();
+    for (const auto &[group, rules] : daemon.configured.intercepts) {
+        const std::string number = std::to_string(group);
+        node_writer writer = {out, std::string(NODE_INTERCEPT_STATE) + "/" + number};
+        out->push_back({writer.above, bn_type_uint8, number});
+        const auto state = states.find(group);
+        const bool known = state != states.end();
+        writer.add("proxy", bn_type_str, words[known ? state->second.state : proxy_health::unknown]);
+        writer.add("proxy_reason", bn_type_str, known ? state->second.reason : "");
+        writer.count("proxy_ms", known ? static_cast<uint64_t>(now - state->second.since_ms) : 0);
+        const auto condition =
+            daemon.applied &&
+            std::any_of(
+                daemon.applied->sorting.groups.begin(), daemon.applied->sorting.groups.end(),
+                [&](const sorted_group &each) { return each.group == group && each.condition.active; });
+        writer.add("active", bn_type_bool, condition ? "true" : "false");
+        const auto outage = daemon.outages.find(group);
+        writer.add("left", bn_type_bool,
+                   outage != daemon.outages.end() && outage->second.left ? "true" : "false");
+        static const packet_count none[SORTED_WAYS] = {};
+        const auto counted = sorting.groups.find(group);
+        add_sorted(&writer, counted == sorting.groups.end() ? none : counted->second);
+    }
+}
+
+} // namespace
+
+std::vector<state_node> tunneld_state(const tunneld &daemon) {
+    std::vector<state_node> out;
+    plane_counters plane;
+    sorting_counters sorting;
+    std::string error;
+    daemon.plane->read_counters(&plane);
+    if (daemon.plane != &table_plane)
+        (void)read_sorting_counters(&sorting, &error);
+
+    node_writer writer = {&out, NODE_PLANE_STATE};
+    writer.add("name", bn_type_str, daemon.plane->name);
+    writer.add("reason", bn_type_str, daemon.plane_reason);
+    writer.add("lack", bn_type_str, daemon.lack);
+    writer.add("failure", bn_type_str, daemon.failure);
+    writer.count("clamped", sorting.clamped);
+    add_refused(&writer, plane.refused);
+    std::map<uint32_t, uint64_t> sources = plane.refused_sources;
+    sources.insert(sorting.refused_sources.begin(), sorting.refused_sources.end());
+    for (const auto &[address, packets] : sources)
+        writer.count("refused_source/" + address_text(address), packets);
+
+    add_tunnels(daemon, plane, sorting, &out);
+    add_intercepts(daemon, sorting, &out);
+    return out;
+}
