@@ -1,0 +1,241 @@
+// From what is known to what the kernel should hold. Nothing here looks at the kernel or changes it.
+//
+// Rules, by preference: marked packets of our interfaces are delivered here, then routed by the main table,
+// then given back from L2 through a link; whatever else comes out of a link goes back into it. A lookup that
+// finds nothing goes on to the next rule and ends in the main table: nothing is lost where a route is
+// missing.
+
+#include "peers/tunneld/wanted_state.h"
+
+#include <linux/rtnetlink.h>
+
+#include <algorithm>
+#include <map>
+#include <optional>
+#include <set>
+
+#include "peers/tunneld/link_names.h"
+
+namespace {
+
+constexpr uint32_t PREFER_LOCAL = RULE_PREFERENCE, PREFER_FORWARD = RULE_PREFERENCE + 1,
+                   PREFER_RETURN = RULE_PREFERENCE + 2, PREFER_LINK = RULE_PREFERENCE + 3;
+// What TCP carries at most in a packet that has to fit into GRE with its redirect header: 1500 less 20 for
+// the outer header, 4 for GRE and 4 for the redirect header, less 40 for the headers of IP and TCP.
+constexpr uint16_t TUNNEL_MSS = 1500 - 28 - 40;
+
+struct name_value {
+    const char *name, *value;
+};
+// With all routes by a link that is down ignored, packets for a TUN device whose program is gone are routed
+// by the main table and not lost.
+constexpr name_value LINK_SETTINGS[] = {{"rp_filter", "0"},
+                                        {"accept_local", "1"},
+                                        {"send_redirects", "0"},
+                                        {"ignore_routes_with_linkdown", "1"},
+                                        {"forwarding", "1"}};
+constexpr name_value L2_SETTINGS[] = {{"accept_local", "1"}, {"send_redirects", "0"}, {"forwarding", "1"}};
+
+// Link numbers by ends.
+using link_numbers = std::map<tunnel_ends, uint32_t>;
+
+bool stands_beside(const accepted_source &source, const tunnel_ends &tunnel) {
+    return !source.router || source.router == tunnel.remote;
+}
+
+std::vector<link_wish> wish_links(const appliance_view &view) {
+    std::vector<link_wish> wishes;
+    std::set<tunnel_ends> taken;
+    for (const auto &[id, ends] : view.tunnels)
+        if (taken.insert(ends).second)
+            wishes.push_back({id, ends.local, ends.remote, false});
+    for (const auto &source : view.accepted)
+        for (const auto &[id, ends] : view.tunnels)
+            if (source.address && stands_beside(source, ends) &&
+                taken.insert({ends.local, source.address}).second)
+                wishes.push_back({id, ends.local, source.address, true});
+    return wishes;
+}
+
+// Known ends keep their number. The number of a link that goes is free only once it has gone.
+link_numbers number_links(const std::vector<link_wish> &wishes, const std::vector<wanted_link> &before) {
+    link_numbers old;
+    std::set<uint32_t> used;
+    for (const auto &link : before) {
+        const auto number = link_number(link.name);
+        if (number && used.insert(*number).second)
+            old.insert({{link.wish.local, link.wish.remote}, *number});
+    }
+    link_numbers numbers;
+    uint32_t next = 0;
+    for (const auto &wish : wishes) {
+        const tunnel_ends ends = {wish.local, wish.remote};
+        const auto known = old.find(ends);
+        if (known == old.end())
+            while (!used.insert(next).second)
+                next++;
+        numbers[ends] = known == old.end() ? next : known->second;
+    }
+    return numbers;
+}
+
+// Whether packets of the group come through this tunnel.
+bool carries_group(const tunnel_ends &tunnel, const group_view &group) {
+    if (group.local && group.local != tunnel.local)
+        return false;
+    if (group.routers.empty())
+        return group.local != 0;
+    return std::any_of(group.routers.begin(), group.routers.end(),
+                       [&](const group_router &router) { return router.id == tunnel.remote; });
+}
+
+// The ends of a group's links and, for each, the tunnel that they stand beside or are.
+std::map<tunnel_ends, tunnel_ends> group_links(const appliance_view &view, const group_view &group) {
+    std::map<tunnel_ends, tunnel_ends> links;
+    for (const auto &[id, tunnel] : view.tunnels) {
+        if (!carries_group(tunnel, group))
+            continue;
+        links[tunnel] = tunnel;
+        for (const auto &source : view.accepted)
+            if (source.address && stands_beside(source, tunnel))
+                links.insert({{tunnel.local, source.address}, tunnel});
+    }
+    return links;
+}
+
+bool redirects_by_l2(const group_view &group) {
+    return is_interface_name(group.interface) &&
+           std::any_of(group.routers.begin(), group.routers.end(),
+                       [](const group_router &router) { return router.forward == travel::l2; });
+}
+
+struct next_hop {
+    std::string interface;
+    uint32_t via;
+};
+// Where a link's packets are given back to by L2. Groups share a link: one that forces L2 decides; otherwise
+// all of its groups have to have agreed on L2 with the router, since GRE is always understood.
+struct l2_choice {
+    std::optional<next_hop> forced, agreed;
+    bool gre = false;
+};
+
+void choose_return(const group_view &group, uint32_t router_id, l2_choice *choice) {
+    for (const auto &router : group.routers) {
+        if (router.id != router_id || router.forward == travel::l2)
+            continue;
+        const bool l2 = group.force_l2_return || router.give_back == travel::l2;
+        if (!l2 || !router.address || !is_interface_name(group.interface)) {
+            choice->gre = true;
+            continue;
+        }
+        auto &hop = group.force_l2_return ? choice->forced : choice->agreed;
+        if (!hop)
+            hop = {group.interface, router.address};
+    }
+}
+
+void want_link(const wanted_link &link, uint32_t number, const l2_choice &choice, wanted_state *out) {
+    const uint32_t table = TABLE_LINK_FIRST + number;
+    out->rules.push_back({PREFER_LOCAL, link.name, MARK_LOCAL, TABLE_LOCAL});
+    out->rules.push_back({PREFER_FORWARD, link.name, MARK_FORWARD, RT_TABLE_MAIN});
+    out->rules.push_back({PREFER_LINK, link.name, 0, table});
+    wanted_route route = {table, false, link.name, 0};
+    if (choice.forced || (choice.agreed && !choice.gre)) {
+        const next_hop &hop = choice.forced ? *choice.forced : *choice.agreed;
+        route.interface = hop.interface;
+        route.via = hop.via;
+    }
+    out->routes.push_back(route);
+    for (const auto &[name, value] : LINK_SETTINGS)
+        out->settings.push_back({link.name + "/" + name, value, false});
+    out->sorting.links.push_back(link.name);
+    out->sorting.ends.push_back({link.wish.local, link.wish.remote});
+    out->sorting.mss = TUNNEL_MSS;
+}
+
+// The link that packets go back through which the router has redirected by L2, if that is what it wants.
+std::optional<uint32_t> l2_return_link(const group_view &group, const link_numbers &numbers) {
+    if (group.force_l2_return)
+        return std::nullopt;
+    for (const auto &router : group.routers)
+        if (router.forward == travel::l2 && router.give_back == travel::gre)
+            for (const auto &[ends, number] : numbers)
+                if (ends.remote == router.id && (!group.local || group.local == ends.local))
+                    return number;
+    return std::nullopt;
+}
+
+void want_l2_interfaces(const appliance_view &view, const link_numbers &numbers, wanted_state *out) {
+    std::map<std::string, std::optional<uint32_t>> interfaces; // with the number of the link to return by
+    for (const auto &[id, group] : view.groups) {
+        if (!redirects_by_l2(group))
+            continue;
+        auto &link = interfaces[group.interface];
+        if (!link)
+            link = l2_return_link(group, numbers);
+    }
+    for (const auto &[name, link] : interfaces) {
+        out->sorting.l2_interfaces.push_back(name);
+        out->rules.push_back({PREFER_LOCAL, name, MARK_LOCAL, TABLE_LOCAL});
+        if (link) {
+            out->sorting.l2_into_gre.push_back({name, MARK_RETURN + *link});
+            out->rules.push_back({PREFER_RETURN, name, MARK_RETURN + *link, TABLE_LINK_FIRST + *link});
+        }
+        for (const auto &[key, value] : L2_SETTINGS)
+            out->settings.push_back({name + "/" + key, value, true});
+    }
+}
+
+void want_sorting(const appliance_view &view, const link_numbers &numbers, wanted_sorting *out) {
+    for (const auto &[id, rules] : view.intercepts) {
+        const auto group = view.groups.find(id);
+        if (group == view.groups.end())
+            continue;
+        const auto condition = view.conditions.find(id);
+        sorted_group sorted = {
+            id, rules, condition == view.conditions.end() ? intercept_condition{} : condition->second, {}};
+        for (const auto &[ends, tunnel] : group_links(view, group->second))
+            sorted.interfaces.push_back(link_name(numbers.at(ends)));
+        if (redirects_by_l2(group->second))
+            sorted.interfaces.push_back(group->second.interface);
+        if (!sorted.interfaces.empty())
+            out->groups.push_back(sorted);
+    }
+    for (const auto &entry : view.bypasses)
+        out->bypasses.push_back(entry.prefix);
+    out->own_addresses = view.own_addresses;
+}
+
+} // namespace
+
+wanted_state make_wanted_state(const appliance_view &view, const std::vector<wanted_link> &before,
+                               bool user_space) {
+    wanted_state wanted;
+    const auto wishes = wish_links(view);
+    const auto numbers = number_links(wishes, before);
+    std::map<tunnel_ends, l2_choice> choices;
+    for (const auto &[id, group] : view.groups)
+        for (const auto &[ends, tunnel] : group_links(view, group))
+            choose_return(group, tunnel.remote, &choices[ends]);
+    std::map<uint32_t, link_wish> by_number;
+    for (const auto &wish : wishes)
+        by_number[numbers.at({wish.local, wish.remote})] = wish;
+    for (const auto &[number, wish] : by_number) {
+        wanted.links.push_back({link_name(number), wish});
+        want_link(wanted.links.back(), number, choices[{wish.local, wish.remote}], &wanted);
+    }
+    want_l2_interfaces(view, numbers, &wanted);
+    if (!wanted.rules.empty()) {
+        wanted.routes.insert(wanted.routes.begin(), {TABLE_LOCAL, true, "", 0});
+        // The larger of the interface's value and this one counts for the first, either of them for the
+        // second.
+        if (!wanted.links.empty())
+            wanted.settings.push_back({"all/rp_filter", "0", true});
+        wanted.settings.push_back({"all/send_redirects", "0", true});
+    }
+    std::sort(wanted.rules.begin(), wanted.rules.end());
+    want_sorting(view, numbers, &wanted.sorting);
+    wanted.sorting.drop_outer_gre = user_space;
+    return wanted;
+}
