@@ -1,0 +1,279 @@
+// What is missing comes first: links, their settings, tables, rules, and then the rules that sort packets
+// into them. What is too much goes in the opposite order. Therefore a packet always finds what it is sent to,
+// and a program that is killed in between leaves nothing that swallows packets.
+
+#include "peers/tunneld/kernel_state.h"
+
+#include <net/if.h>
+
+#include <algorithm>
+#include <cstring>
+#include <functional>
+#include <set>
+
+#include "peers/tunneld/kernel_links.h"
+#include "peers/tunneld/kernel_routes.h"
+#include "peers/tunneld/kernel_settings.h"
+#include "peers/tunneld/link_names.h"
+#include "peers/tunneld/sorting_rules.h"
+
+namespace {
+
+// Links that the plane of this process has made or taken over, by name. The others are only in the kernel.
+struct made_link {
+    link_wish wish;
+    uint32_t index;
+};
+std::map<std::string, made_link> made;
+
+// The first failure is the one to give.
+struct failure {
+    std::string text;
+    void note(const std::string &error) {
+        if (text.empty())
+            text = error;
+    }
+    void note(const std::string &what, int error) {
+        if (error)
+            note(what + ": " + strerror(error));
+    }
+    bool give(std::string *out_error) const {
+        *out_error = text;
+        return text.empty();
+    }
+};
+
+bool same_ends(const link_wish &one, const link_wish &other) {
+    return one.local == other.local && one.remote == other.remote;
+}
+
+const wanted_link *find_wanted(const wanted_state &wanted, const std::string &name) {
+    const auto found = std::find_if(wanted.links.begin(), wanted.links.end(),
+                                    [&](const wanted_link &link) { return link.name == name; });
+    return found == wanted.links.end() ? nullptr : &*found;
+}
+
+bool drop_made_link(const data_plane &plane, const std::string &name, failure *failed) {
+    std::string error;
+    if (!plane.drop_link(name, &error)) {
+        failed->note(error);
+        return false;
+    }
+    made.erase(name);
+    return true;
+}
+
+// A link that is not as it is wanted goes. False: what is in the kernel under this name stays.
+bool make_room(const data_plane &plane, const wanted_link &link, found_link *found, failure *failed) {
+    const auto known = made.find(link.name);
+    if (known != made.end() && known->second.index != static_cast<uint32_t>(found->index)) {
+        std::string error; // somebody else has removed the link: there is nothing to fail
+        plane.drop_link(link.name, &error);
+        made.erase(known);
+    } else if (known != made.end() && !same_ends(known->second.wish, link.wish)) {
+        if (!drop_made_link(plane, link.name, failed))
+            return false;
+        *found = {};
+    }
+    const char *kind = &plane == &kernel_plane ? "gre" : "tun";
+    if (found->index && (found->kind != kind || (found->wish && !same_ends(*found->wish, link.wish)))) {
+        const int error = remove_link(found->index);
+        failed->note("cannot remove link " + link.name, error);
+        if (error)
+            return false;
+        *found = {};
+    }
+    return true;
+}
+
+// The link with its marks, but not yet up. False: there is none.
+bool make_link(const data_plane &plane, const wanted_link &link, found_link *found, failure *failed) {
+    if (&plane != &table_plane && !make_room(plane, link, found, failed))
+        return false;
+    const auto known = made.find(link.name);
+    if (known == made.end() || known->second.wish != link.wish) {
+        uint32_t index = 0;
+        std::string error;
+        if (!plane.make_link(link.name, link.wish, &index, &error)) {
+            failed->note(error);
+            return false;
+        }
+        made[link.name] = {link.wish, index};
+        if (&plane != &table_plane && index != static_cast<uint32_t>(found->index)) {
+            *found = {};
+            found->index = static_cast<int>(index);
+        }
+    }
+    if (&plane == &table_plane)
+        return true;
+    if (found->group == LINK_GROUP && found->mtu == LINK_MTU && found->wish == link.wish)
+        return true;
+    const int error = mark_link(found->index, link.wish);
+    failed->note("cannot mark link " + link.name, error);
+    return error == 0;
+}
+
+void bring_up(const wanted_link &link, const found_link &found, failure *failed) {
+    if (found.is_up)
+        return;
+    disable_ipv6(link.name);
+    failed->note("cannot bring link " + link.name + " up", bring_link_up(found.index));
+}
+
+void add_routes(const wanted_state &wanted, const std::vector<found_route> &found, failure *failed) {
+    for (const auto &route : wanted.routes) {
+        const bool is_there = std::any_of(found.begin(), found.end(), [&](const found_route &one) {
+            return !one.odd && one.route == route;
+        });
+        if (!is_there)
+            failed->note("cannot add " + route_text(route), put_route(route));
+    }
+}
+
+void remove_routes(const wanted_state &wanted, const std::vector<found_route> &found, failure *failed) {
+    for (const auto &one : found)
+        if (one.odd ||
+            std::find(wanted.routes.begin(), wanted.routes.end(), one.route) == wanted.routes.end())
+            failed->note("cannot remove " + route_text(one.route), remove_route(one));
+}
+
+void add_rules(const wanted_state &wanted, const std::vector<found_rule> &found, failure *failed) {
+    std::set<wanted_rule> there;
+    for (const auto &one : found)
+        if (!one.odd)
+            there.insert(one.rule);
+    for (const auto &rule : wanted.rules)
+        if (!there.count(rule))
+            failed->note("cannot add " + rule_text(rule), add_rule(rule));
+}
+
+void remove_rules(const wanted_state &wanted, const std::vector<found_rule> &found, failure *failed) {
+    const std::set<wanted_rule> rules(wanted.rules.begin(), wanted.rules.end());
+    for (const auto &one : found)
+        if (one.odd || !rules.count(one.rule))
+            failed->note("cannot remove " + rule_text(one.rule), remove_rule(one.rule));
+}
+
+void drop_unwanted_made(const data_plane &plane, const wanted_state &wanted, failure *failed) {
+    std::vector<std::string> names;
+    for (const auto &[name, link] : made)
+        if (!find_wanted(wanted, name))
+            names.push_back(name);
+    for (const auto &name : names)
+        drop_made_link(plane, name, failed);
+}
+
+// What is there of ours, besides what the process knows itself.
+struct kernel_view {
+    std::vector<found_link> links;
+    std::vector<found_route> routes;
+    std::vector<found_rule> rules;
+};
+
+void remove_unwanted(const data_plane &plane, const wanted_state &wanted, const kernel_view &there,
+                     failure *failed) {
+    remove_rules(wanted, there.rules, failed);
+    remove_routes(wanted, there.routes, failed);
+    std::string error;
+    if (!restore_settings(wanted.settings, &error))
+        failed->note(error);
+    drop_unwanted_made(plane, wanted, failed);
+    for (const auto &link : there.links)
+        if (!find_wanted(wanted, link.name) && !made.count(link.name))
+            failed->note("cannot remove link " + link.name, remove_link(link.index));
+}
+
+bool reconcile_table(const wanted_state &wanted, std::map<std::string, uint32_t> *out_indices,
+                     failure *failed) {
+    for (const auto &link : wanted.links) {
+        found_link none;
+        if (make_link(table_plane, link, &none, failed))
+            (*out_indices)[link.name] = made.at(link.name).index;
+    }
+    drop_unwanted_made(table_plane, wanted, failed);
+    return failed->text.empty();
+}
+
+bool reconcile_links(const data_plane &plane, const wanted_state &wanted, kernel_view *there,
+                     std::map<std::string, uint32_t> *out_indices, failure *failed) {
+    const int error = find_links(false, &there->links);
+    failed->note("cannot list links", error);
+    if (error)
+        return false;
+    std::map<std::string, found_link> found;
+    for (const auto &link : there->links)
+        found[link.name] = link;
+    for (const auto &link : wanted.links)
+        if (make_link(plane, link, &found[link.name], failed))
+            (*out_indices)[link.name] = static_cast<uint32_t>(found[link.name].index);
+    std::string text;
+    if (!apply_settings(wanted.settings, &text))
+        failed->note(text);
+    for (const auto &link : wanted.links)
+        if (out_indices->count(link.name))
+            bring_up(link, found[link.name], failed);
+    return true;
+}
+
+bool find_tables(kernel_view *there, failure *failed) {
+    const int routes = find_routes(&there->routes), rules = find_rules(&there->rules);
+    failed->note("cannot list routes", routes);
+    failed->note("cannot list rules", rules);
+    return !routes && !rules;
+}
+
+} // namespace
+
+std::vector<wanted_link> find_own_links() {
+    std::vector<found_link> found;
+    std::vector<wanted_link> links;
+    if (find_links(false, &found))
+        return links;
+    for (const auto &link : found) {
+        const bool is_known = link.wish && link_number(link.name) &&
+                              std::none_of(links.begin(), links.end(), [&](const wanted_link &other) {
+                                  return same_ends(other.wish, *link.wish);
+                              });
+        if (is_known)
+            links.push_back({link.name, *link.wish});
+    }
+    return links;
+}
+
+bool reconcile_kernel_state(const data_plane &plane, const wanted_state &wanted,
+                            std::map<std::string, uint32_t> *out_indices, std::string *out_error) {
+    failure failed;
+    out_indices->clear();
+    if (&plane == &table_plane)
+        return reconcile_table(wanted, out_indices, &failed) && failed.give(out_error);
+    kernel_view there;
+    if (!reconcile_links(plane, wanted, &there, out_indices, &failed))
+        return failed.give(out_error);
+    // Looked at after the links have changed: a link that is replaced takes its routes with it.
+    if (!find_tables(&there, &failed))
+        return failed.give(out_error);
+    add_routes(wanted, there.routes, &failed);
+    add_rules(wanted, there.rules, &failed);
+    std::string error;
+    if (!apply_sorting_rules(wanted.sorting, &error))
+        failed.note(error);
+    remove_unwanted(plane, wanted, there, &failed);
+    return failed.give(out_error);
+}
+
+bool remove_kernel_state(const data_plane &plane, std::string *out_error) {
+    failure failed;
+    const wanted_state nothing;
+    if (&plane == &table_plane) {
+        drop_unwanted_made(plane, nothing, &failed);
+        return failed.give(out_error);
+    }
+    std::string error;
+    if (!remove_sorting_rules(&error))
+        failed.note(error);
+    kernel_view there;
+    failed.note("cannot list links", find_links(false, &there.links));
+    find_tables(&there, &failed);
+    remove_unwanted(plane, nothing, there, &failed);
+    return failed.give(out_error);
+}

@@ -1,0 +1,121 @@
+#include "peers/tunneld/netlink.h"
+
+#include <linux/rtnetlink.h>
+#include <netlink/netlink.h>
+#include <netlink/socket.h>
+#include <sys/socket.h>
+
+#include <cerrno>
+#include <new>
+
+namespace {
+
+constexpr int QUERY_TRIES = 5;
+
+struct socket_release {
+    void operator()(nl_sock *socket) const { nl_socket_free(socket); }
+};
+std::unique_ptr<nl_sock, socket_release> kernel;
+
+// An unanswered request leaves the socket out of step: it is closed then, and opened anew by the next one.
+nl_sock *kernel_socket() {
+    if (kernel)
+        return kernel.get();
+    kernel.reset(nl_socket_alloc());
+    if (!kernel)
+        throw std::bad_alloc();
+    if (nl_connect(kernel.get(), NETLINK_ROUTE) < 0) {
+        kernel.reset();
+        return nullptr;
+    }
+    nl_socket_disable_auto_ack(kernel.get());
+    // Dumps are filtered by the kernel; an older one gives everything.
+    const int on = 1;
+    setsockopt(nl_socket_get_fd(kernel.get()), SOL_NETLINK, NETLINK_GET_STRICT_CHK, &on, sizeof on);
+    return kernel.get();
+}
+
+struct exchange {
+    const std::function<void(nlmsghdr *)> *each;
+    bool done = false;
+    int error = 0;
+};
+
+int take_error(sockaddr_nl *, nlmsgerr *message, void *context) {
+    auto *state = static_cast<exchange *>(context);
+    state->done = true;
+    state->error = -message->error;
+    return NL_STOP;
+}
+
+int take_end(nl_msg *, void *context) {
+    static_cast<exchange *>(context)->done = true;
+    return NL_STOP;
+}
+
+int take_answer(nl_msg *message, void *context) {
+    auto *state = static_cast<exchange *>(context);
+    if (state->each)
+        (*state->each)(nlmsg_hdr(message));
+    return NL_OK;
+}
+
+struct callbacks_release {
+    void operator()(nl_cb *callbacks) const { nl_cb_put(callbacks); }
+};
+
+// EINTR: the table has changed during the dump.
+int transact(nl_msg *message, const std::function<void(nlmsghdr *)> *each) {
+    nl_sock *socket = kernel_socket();
+    if (!socket)
+        return errno ? errno : EIO;
+    const std::unique_ptr<nl_cb, callbacks_release> callbacks(nl_cb_alloc(NL_CB_DEFAULT));
+    if (!callbacks)
+        throw std::bad_alloc();
+    exchange state;
+    state.each = each;
+    nl_cb_err(callbacks.get(), NL_CB_CUSTOM, take_error, &state);
+    nl_cb_set(callbacks.get(), NL_CB_FINISH, NL_CB_CUSTOM, take_end, &state);
+    nl_cb_set(callbacks.get(), NL_CB_ACK, NL_CB_CUSTOM, take_end, &state);
+    nl_cb_set(callbacks.get(), NL_CB_VALID, NL_CB_CUSTOM, take_answer, &state);
+    nlmsg_hdr(message)->nlmsg_seq = NL_AUTO_SEQ; // a new one when it is sent again
+    if (nl_send_auto(socket, message) < 0) {
+        const int error = errno;
+        kernel.reset();
+        return error ? error : EIO;
+    }
+    while (!state.done) {
+        const int result = nl_recvmsgs(socket, callbacks.get());
+        if (result == -NLE_DUMP_INTR)
+            state.error = EINTR; // the rest of the dump still comes
+        else if (result < 0 && !state.done) {
+            kernel.reset();
+            return EIO;
+        }
+    }
+    return state.error;
+}
+
+} // namespace
+
+netlink_message make_netlink_message(int type, int flags, const void *header, size_t header_length) {
+    netlink_message message(nlmsg_alloc_simple(type, NLM_F_REQUEST | flags));
+    if (!message || nlmsg_append(message.get(), const_cast<void *>(header), header_length, NLMSG_ALIGNTO) < 0)
+        throw std::bad_alloc();
+    return message;
+}
+
+int change_kernel(nl_msg *message) {
+    nlmsg_hdr(message)->nlmsg_flags |= NLM_F_ACK;
+    return transact(message, nullptr);
+}
+
+int query_kernel(nl_msg *message, const std::function<void(nlmsghdr *)> &each,
+                 const std::function<void()> &restart) {
+    int error = EINTR;
+    for (int i = 0; i < QUERY_TRIES && error == EINTR; i++) {
+        restart();
+        error = transact(message, &each);
+    }
+    return error;
+}

@@ -1,0 +1,607 @@
+// From the appliance's view to what the kernel holds: links, routes, rules and settings of ours are made,
+// found, taken over and removed. The links are TUN devices of a plane of the test, since not every kernel has
+// GRE. Each program (a tunneld, its successor) is a process of its own.
+
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <linux/if_tun.h>
+#include <linux/rtnetlink.h>
+#include <net/if.h>
+#include <sys/ioctl.h>
+#include <sys/mount.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <set>
+
+#include "peers/tunneld/kernel_links.h"
+#include "peers/tunneld/kernel_routes.h"
+#include "peers/tunneld/kernel_state.h"
+#include "peers/tunneld/link_names.h"
+#include "peers/tunneld/sorting_rules.h"
+#include "peers/tunneld/table_plane.h"
+
+// In place of the rules that sort packets: what they send packets to has to be there before they come, and
+// until they have gone.
+static wanted_sorting sorted;
+static bool needs_are_met(const wanted_sorting &sorting) {
+    std::vector<found_rule> rules;
+    std::vector<found_route> routes;
+    if (find_rules(&rules) || find_routes(&routes))
+        return false;
+    return std::all_of(sorting.links.begin(), sorting.links.end(), [&](const std::string &name) {
+        const uint32_t table = TABLE_LINK_FIRST + *link_number(name);
+        return if_nametoindex(name.c_str()) &&
+               std::any_of(routes.begin(), routes.end(),
+                           [&](const found_route &one) { return one.route.table == table; }) &&
+               std::any_of(rules.begin(), rules.end(), [&](const found_rule &one) {
+                   return one.rule.table == table && one.rule.in_interface == name;
+               });
+    });
+}
+[[gnu::weak]] bool apply_sorting_rules(const wanted_sorting &wanted, std::string *out_error) {
+    if (!needs_are_met(sorted) || !needs_are_met(wanted))
+        *out_error = "sorted to nowhere";
+    sorted = wanted;
+    return out_error->empty();
+}
+[[gnu::weak]] bool remove_sorting_rules(std::string *out_error) {
+    return apply_sorting_rules({}, out_error);
+}
+
+namespace {
+
+// ---- what is wanted
+
+constexpr uint32_t LOCAL = 0x0A000065, R1 = 0x0A000001, R2 = 0x0A000002, OTHER = 0x0A000009;
+
+appliance_view two_tunnels() {
+    appliance_view view;
+    view.tunnels = {{3, {LOCAL, R1}}, {4, {LOCAL, R2}}};
+    view.groups[61] = {"eth0", LOCAL, 0, false, {{R1, R1 + 16, travel::gre, travel::gre}}};
+    view.intercepts[61].to = 3128;
+    return view;
+}
+
+std::string describe_route(const wanted_route &route) {
+    return "route " + std::to_string(route.table) + (route.local ? " local" : " " + route.interface) +
+           (route.via ? " via " + address_text(route.via) : "");
+}
+std::string describe_rule(const wanted_rule &rule) {
+    char text[80];
+    snprintf(text, sizeof text, "rule %u %s %x %u", rule.preference - RULE_PREFERENCE,
+             rule.in_interface.c_str(), rule.mark, rule.table);
+    return text;
+}
+
+std::set<std::string> describe(const wanted_state &wanted) {
+    std::set<std::string> lines;
+    for (const auto &link : wanted.links)
+        lines.insert("link " + link.name + " " + link_alias(link.wish));
+    for (const auto &rule : wanted.rules)
+        lines.insert(describe_rule(rule));
+    for (const auto &route : wanted.routes)
+        lines.insert(describe_route(route));
+    for (const auto &setting : wanted.settings)
+        lines.insert("setting " + setting.path + " " + setting.value + (setting.restore ? " restored" : ""));
+    const wanted_sorting &sorting = wanted.sorting;
+    for (const auto &name : sorting.l2_interfaces)
+        lines.insert("l2 " + name);
+    for (const auto &[name, mark] : sorting.l2_into_gre)
+        lines.insert("l2 " + name + " into " + std::to_string(mark - MARK_RETURN));
+    for (const auto &ends : sorting.ends)
+        lines.insert("ends " + address_text(ends.local) + " " + address_text(ends.remote));
+    for (const auto &group : sorting.groups) {
+        std::string line = "group " + std::to_string(group.group);
+        for (const auto &name : group.interfaces)
+            line += " " + name;
+        lines.insert(line);
+    }
+    lines.insert("mss " + std::to_string(sorting.mss) + (sorting.drop_outer_gre ? " outer dropped" : ""));
+    return lines;
+}
+
+struct wanted_case {
+    const char *name;
+    std::function<void(appliance_view *)> change; // of two tunnels to two routers, and a group of the first
+    std::vector<std::string> present, absent;
+};
+
+const wanted_case wanted_cases[] = {
+    {"a group with its router's tunnel; the other is carried as well",
+     [](appliance_view *) {},
+     {"link wccp0 tunneld 3 10.0.0.101 10.0.0.1", "link wccp1 tunneld 4 10.0.0.101 10.0.0.2",
+      "group 61 wccp0", "rule 0 wccp1 57430001 204800", "rule 1 wccp1 57430002 254", "rule 3 wccp1 0 204802",
+      "route 204800 local", "route 204802 wccp1", "setting wccp1/rp_filter 0",
+      "setting all/rp_filter 0 restored", "setting all/send_redirects 0 restored", "ends 10.0.0.101 10.0.0.2",
+      "mss 1432 outer dropped"},
+     {"l2 eth0", "setting eth0/forwarding 1 restored"}},
+    {"routers not known yet: every tunnel of the group's address",
+     [](appliance_view *view) {
+         view->groups[61].routers.clear();
+         view->tunnels[5] = {LOCAL + 1, R1};
+     },
+     {"group 61 wccp0 wccp1", "route 204803 wccp2"},
+     {}},
+    {"neither an intercept without a group nor one of a group without packets",
+     [](appliance_view *view) {
+         view->intercepts[70] = view->intercepts[61];
+         view->groups[61].local = OTHER;
+     },
+     {"mss 1432 outer dropped"},
+     {"group 61", "group 61 wccp0", "group 70"}},
+    {"nothing known",
+     [](appliance_view *view) { *view = {}; },
+     {"mss 0 outer dropped"},
+     {"route 204800 local", "setting all/rp_filter 0 restored"}},
+    {"a further source stands beside tunnels to its router, and never twice",
+     [](appliance_view *view) {
+         view->tunnels[5] = {LOCAL, R1}; // an id too many
+         view->accepted = {{OTHER, R1}, {OTHER, 0}, {R2, 0}, {0, 0}};
+     },
+     {"link wccp2 tunneld 3 10.0.0.101 10.0.0.9 accepted", "route 204803 wccp2",
+      "group 61 wccp0 wccp1 wccp2"},
+     {"route 204804 wccp3"}},
+    {"L2 return agreed with the router, which a further source follows",
+     [](appliance_view *view) {
+         view->groups[61].routers[0].give_back = travel::l2;
+         view->accepted = {{OTHER, R1}};
+     },
+     {"route 204801 eth0 via 10.0.0.17", "route 204803 eth0 via 10.0.0.17", "route 204802 wccp1"},
+     {"l2 eth0"}},
+    {"one group of two has agreed on L2 return: the link they share returns by GRE",
+     [](appliance_view *view) {
+         view->groups[62] = view->groups[61];
+         view->groups[62].routers[0].give_back = travel::l2;
+     },
+     {"route 204801 wccp0"},
+     {"group 62 wccp0"}},
+    {"L2 return forced by one of two",
+     [](appliance_view *view) {
+         view->groups[62] = view->groups[61];
+         view->groups[62].force_l2_return = true;
+     },
+     {"route 204801 eth0 via 10.0.0.17"},
+     {}},
+    {"L2 both ways, also without an intercept",
+     [](appliance_view *view) {
+         view->tunnels.clear();
+         view->intercepts.clear();
+         view->groups[61].routers[0].forward = view->groups[61].routers[0].give_back = travel::l2;
+     },
+     {"l2 eth0", "rule 0 eth0 57430001 204800", "setting eth0/forwarding 1 restored",
+      "setting eth0/send_redirects 0 restored", "setting all/send_redirects 0 restored",
+      "mss 0 outer dropped"},
+     {"setting all/rp_filter 0 restored", "group 61 eth0", "rule 1 eth0 57430002 254"}},
+    {"redirected by L2, given back by GRE",
+     [](appliance_view *view) {
+         view->groups[61].routers = {{R2, R2, travel::l2, travel::gre}};
+     },
+     {"l2 eth0", "l2 eth0 into 1", "rule 2 eth0 57430101 204802", "group 61 wccp1 eth0",
+      "route 204802 wccp1"},
+     {}},
+    {"no interface by a name that leads out of its directory",
+     [](appliance_view *view) {
+         view->groups[61] = {"../../x", LOCAL, 0, true, {{R1, R1, travel::l2, travel::gre}}};
+     },
+     {"route 204801 wccp0"},
+     {"l2 ../../x", "rule 0 ../../x 57430001 204800"}},
+};
+
+TEST(wanted_state, follows_the_view) {
+    for (const auto &one : wanted_cases) {
+        SCOPED_TRACE(one.name);
+        appliance_view view = two_tunnels();
+        one.change(&view);
+        const auto lines = describe(make_wanted_state(view, {}, true));
+        for (const auto &line : one.present)
+            EXPECT_TRUE(lines.count(line)) << line;
+        for (const auto &line : one.absent)
+            EXPECT_FALSE(lines.count(line)) << line;
+    }
+}
+
+TEST(wanted_state, links_keep_their_numbers) {
+    appliance_view view = two_tunnels();
+    view.tunnels.erase(3);
+    view.tunnels[9] = {LOCAL, R2}; // under another id
+    view.tunnels.erase(4);
+    view.tunnels[1] = {LOCAL, OTHER};
+    const std::vector<wanted_link> before = make_wanted_state(two_tunnels(), {}, false).links;
+    const auto links = make_wanted_state(view, before, false).links;
+    // wccp0 is still there when the new one is made.
+    EXPECT_EQ(links, (std::vector<wanted_link>{{"wccp1", {9, LOCAL, R2, false}},
+                                               {"wccp2", {1, LOCAL, OTHER, false}}}));
+}
+
+TEST(link_names, only_ours_are_read) {
+    const link_wish wish = {65535, LOCAL, R1, true};
+    EXPECT_EQ(link_alias(wish), "tunneld 65535 10.0.0.101 10.0.0.1 accepted");
+    EXPECT_EQ(parse_link_alias(link_alias(wish)), wish);
+    for (const std::string alias :
+         {"", "tunneld", "tunneld 3 10.0.0.101", "tunneld 65536 10.0.0.101 10.0.0.1",
+          "tunneld 03 10.0.0.101 10.0.0.1", "tunneld 3 10.0.0.101 10.0.0.1 ",
+          "tunneld 3 10.0.0.101 10.0.0.1 accepted more", "tunneld -1 1.1.1.1 2.2.2.2",
+          "tunneld 3 10.0.0.101 10.0.0.1 refused", "tunneld 3 10.0.0.256 10.0.0.1"})
+        EXPECT_FALSE(parse_link_alias(alias)) << alias;
+    EXPECT_FALSE(parse_link_alias("tunneld 3 10.0.0.101 10.0.0.1" + std::string(200, ' ')));
+    for (const char *name : {"wccp", "wccp01", "wccp65536", "wccp123456", "wccp1x", "eth0"})
+        EXPECT_FALSE(link_number(name)) << name;
+    EXPECT_EQ(link_number("wccp65535"), 65535u);
+}
+
+TEST(table_plane, rising_indices_and_nothing_in_the_kernel) {
+    table_plane_next_index = 7;
+    std::map<std::string, uint32_t> indices;
+    std::string error;
+    const auto wanted = make_wanted_state(two_tunnels(), {}, false);
+    for (int i = 0; i < 2; i++) {
+        EXPECT_TRUE(reconcile_kernel_state(table_plane, wanted, &indices, &error)) << error;
+        EXPECT_EQ(indices, (std::map<std::string, uint32_t>{{"wccp0", 7}, {"wccp1", 8}}));
+    }
+    EXPECT_EQ(if_nametoindex("wccp0"), 0u);
+    EXPECT_TRUE(remove_kernel_state(table_plane, &error));
+    table_plane_next_index = 0xFFFFFFFE;
+    EXPECT_TRUE(reconcile_kernel_state(table_plane, wanted, &indices, &error)) << error;
+    EXPECT_EQ(indices["wccp1"], 1u); // past the value that stands for none
+    EXPECT_TRUE(remove_kernel_state(table_plane, &error));
+}
+
+// ---- the kernel
+
+// A persistent TUN device, with this process at its other end. -1: it could not be made.
+int open_tun(const std::string &name) {
+    const int fd = open("/dev/net/tun", O_RDWR | O_CLOEXEC);
+    ifreq request = {};
+    strncpy(request.ifr_name, name.c_str(), IFNAMSIZ - 1);
+    request.ifr_flags = IFF_TUN | IFF_NO_PI;
+    if (fd >= 0 && (ioctl(fd, TUNSETIFF, &request) || ioctl(fd, TUNSETPERSIST, 1))) {
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+std::map<std::string, int> tuns;
+
+bool make_tun(const std::string &name, const link_wish &, uint32_t *out_index, std::string *out_error) {
+    if (!tuns.count(name)) {
+        const int fd = open_tun(name);
+        if (fd < 0) {
+            *out_error = "cannot make " + name;
+            return false;
+        }
+        tuns[name] = fd;
+    }
+    *out_index = if_nametoindex(name.c_str());
+    return true;
+}
+bool drop_tun(const std::string &name, std::string *) {
+    const auto found = tuns.find(name);
+    if (found == tuns.end())
+        return true;
+    ioctl(found->second, TUNSETPERSIST, 0);
+    close(found->second);
+    tuns.erase(found);
+    return true;
+}
+const data_plane tun_plane = {"tun", nullptr, nullptr, nullptr, make_tun, drop_tun, nullptr};
+
+// Runs in a process of its own, which is gone afterwards without any orderly end.
+void run_program(const std::function<void()> &steps) {
+    fflush(nullptr);
+    const pid_t child = fork();
+    if (child == 0) {
+        steps();
+        fflush(nullptr);
+        _exit(::testing::Test::HasFailure() ? 1 : 0);
+    }
+    int status = -1;
+    waitpid(child, &status, 0);
+    EXPECT_EQ(status, 0) << "see above";
+}
+
+std::string setting_file(const std::string &path) {
+    return "/proc/sys/net/ipv4/conf/" + path;
+}
+void set(const std::string &path, const std::string &value) {
+    std::ofstream(setting_file(path)) << value;
+}
+std::string get(const std::string &path) {
+    std::string value;
+    std::ifstream(setting_file(path)) >> value;
+    return value;
+}
+
+// How a packet would be routed.
+std::string route_of(const std::string &arguments) {
+    FILE *ip = popen(("ip route get 198.51.100.1 from 203.0.113.1 " + arguments + " 2>&1").c_str(), "r");
+    char text[200] = "";
+    const size_t length = fread(text, 1, sizeof text - 1, ip);
+    text[length] = '\0';
+    pclose(ip);
+    return text;
+}
+
+// Hears of every change of links, addresses, routes, rules and settings.
+struct change_listener {
+    change_listener() : fd(socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE)) {
+        const sockaddr_nl own = {AF_NETLINK, 0, 0, 0};
+        EXPECT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&own), sizeof own), 0);
+        for (const int group :
+             {RTNLGRP_LINK, RTNLGRP_IPV4_IFADDR, RTNLGRP_IPV4_ROUTE, RTNLGRP_IPV4_RULE, RTNLGRP_IPV4_NETCONF})
+            EXPECT_EQ(setsockopt(fd, SOL_NETLINK, NETLINK_ADD_MEMBERSHIP, &group, sizeof group), 0);
+    }
+    ~change_listener() { close(fd); }
+    int count() const {
+        char buffer[65536];
+        int count = 0;
+        while (recv(fd, buffer, sizeof buffer, MSG_DONTWAIT) > 0)
+            count++;
+        return count;
+    }
+    const int fd;
+};
+
+std::map<std::string, uint32_t> indices;
+std::string reconcile(const wanted_state &wanted) {
+    std::string error;
+    const bool done = reconcile_kernel_state(tun_plane, wanted, &indices, &error);
+    EXPECT_EQ(done, error.empty());
+    return error;
+}
+
+// All that is in the kernel of ours, in the words of describe().
+std::set<std::string> find_ours() {
+    std::set<std::string> lines;
+    std::vector<found_link> links;
+    std::vector<found_rule> rules;
+    std::vector<found_route> routes;
+    EXPECT_EQ(find_links(false, &links), 0);
+    EXPECT_EQ(find_rules(&rules), 0);
+    EXPECT_EQ(find_routes(&routes), 0);
+    for (const auto &link : links)
+        lines.insert("link " + link.name + " " + link.alias +
+                     (link.group == LINK_GROUP && link.mtu == LINK_MTU && link.is_up ? "" : " unmarked"));
+    for (const auto &one : rules)
+        lines.insert(describe_rule(one.rule) + (one.odd ? " odd" : ""));
+    for (const auto &one : routes)
+        lines.insert(describe_route(one.route) + (one.odd ? " odd" : ""));
+    return lines;
+}
+std::set<std::string> links_and_tables(const wanted_state &wanted) {
+    std::set<std::string> lines;
+    for (const auto &line : describe(wanted))
+        if (line.starts_with("link ") || line.starts_with("rule ") || line.starts_with("route "))
+            lines.insert(line);
+    return lines;
+}
+
+// An interface "eth0" that isn't ours, and its program, for as long as the test runs.
+class kernel_state : public ::testing::Test {
+protected:
+    void SetUp() override {
+        ASSERT_EQ(geteuid(), 0u) << "run by lab/in-appliance";
+        lan = open_tun("eth0");
+        ASSERT_GE(lan, 0);
+        ASSERT_EQ(system("ip address add 10.0.0.101/24 dev eth0 && ip link set eth0 up && "
+                         "ip route add default via 10.0.0.254"),
+                  0);
+        for (const char *key : {"rp_filter", "send_redirects"})
+            for (const char *interface : {"all", "default", "eth0"})
+                set(std::string(interface) + "/" + key, strcmp(interface, "all") == 0 ? "1" : "0");
+    }
+    void TearDown() override {
+        run_program([] {
+            std::string error;
+            EXPECT_TRUE(remove_kernel_state(tun_plane, &error)) << error;
+            EXPECT_EQ(find_ours(), std::set<std::string>());
+        });
+        ioctl(lan, TUNSETPERSIST, 0);
+        close(lan);
+    }
+    int lan = -1;
+};
+
+TEST_F(kernel_state, made_once_followed_and_removed) {
+    run_program([] {
+        appliance_view view = two_tunnels();
+        auto wanted = make_wanted_state(view, {}, true);
+        EXPECT_EQ(reconcile(wanted), "");
+        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        EXPECT_EQ(indices["wccp1"], if_nametoindex("wccp1"));
+        for (const auto &setting : wanted.settings)
+            EXPECT_EQ(get(setting.path), setting.value) << setting.path;
+
+        EXPECT_NE(route_of("iif wccp0").find("table 204801"), std::string::npos) << route_of("iif wccp0");
+        EXPECT_EQ(route_of("iif wccp0 mark 0x57430001").find("local "), 0u);
+        EXPECT_NE(route_of("iif wccp0 mark 0x57430002").find("dev eth0"), std::string::npos);
+
+        const change_listener changes;
+        EXPECT_EQ(reconcile(wanted), "");
+        EXPECT_EQ(changes.count(), 0);
+
+        // A tunnel under another id, L2 return for its router, the other tunnel gone.
+        const uint32_t index = indices["wccp0"];
+        view.tunnels = {{30, {LOCAL, R1}}};
+        view.groups[61].force_l2_return = true;
+        wanted = make_wanted_state(view, wanted.links, true);
+        EXPECT_EQ(reconcile(wanted), "");
+        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        EXPECT_EQ(indices, (std::map<std::string, uint32_t>{{"wccp0", index}}));
+
+        // Somebody takes a link down, which loses its route, and then the link itself.
+        EXPECT_EQ(system("ip link set wccp0 down mtu 1400"), 0);
+        EXPECT_EQ(reconcile(wanted), "");
+        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        EXPECT_EQ(system("ip link delete wccp0"), 0);
+        EXPECT_EQ(reconcile(wanted), "");
+        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        EXPECT_EQ(indices["wccp0"], if_nametoindex("wccp0"));
+
+        // The same number for other ends is another link.
+        wanted.links[0].wish.remote = OTHER;
+        EXPECT_EQ(reconcile(wanted), "");
+        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+
+        std::string error;
+        EXPECT_TRUE(remove_kernel_state(tun_plane, &error)) << error;
+        EXPECT_EQ(find_ours(), std::set<std::string>());
+        EXPECT_FALSE(std::filesystem::exists("/run/tunneld/settings"));
+    });
+}
+
+TEST_F(kernel_state, what_a_killed_program_leaves_is_taken_over) {
+    appliance_view view = two_tunnels();
+    view.groups[61].routers[0].forward = travel::l2;
+    run_program([&] { EXPECT_EQ(reconcile(make_wanted_state(view, {}, true)), ""); });
+    // A link without a program at its other end loses nothing: once the kernel has noticed, its packets are
+    // routed as others are.
+    std::string route;
+    for (int i = 0; i < 150 && route.find("dev eth0") == std::string::npos; i++) {
+        usleep(20000);
+        route = route_of("iif eth0 mark 0x57430100");
+    }
+    EXPECT_NE(route.find("dev eth0"), std::string::npos) << route;
+    // Made but not marked, marked by a stranger, of a stranger, and rules and routes that nobody wants.
+    for (const char *name : {"wccp5", "wccp7", "tun3"})
+        close(open_tun(name));
+    EXPECT_EQ(system("ip link set wccp7 group 2048 alias 'tunneld 3 10.0.0.101 10.0.0.1 $(reboot) \x01'\n"
+                     "ip link set wccp1 alias ''\n"
+                     "ip link set wccp5 up\n"
+                     "ip route add 192.0.2.0/24 dev wccp5 table 204806 protocol 204\n"
+                     "ip route add blackhole default table 204900 protocol 204\n"
+                     "ip route add 192.0.3.0/24 dev eth0 table 204806\n"
+                     "ip rule add from 192.0.2.7 table 204900 preference 2051 protocol 204\n"
+                     "ip rule add from 192.0.2.8 table 204900 preference 2051"),
+              0);
+    run_program([&] {
+        const uint32_t index = if_nametoindex("wccp0"), unmarked = if_nametoindex("wccp1");
+        const auto before = find_own_links();
+        EXPECT_EQ(before, (std::vector<wanted_link>{{"wccp0", {3, LOCAL, R1, false}}}));
+        const auto wanted = make_wanted_state(view, before, true);
+        EXPECT_EQ(reconcile(wanted), "");
+        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        EXPECT_EQ(indices, (std::map<std::string, uint32_t>{{"wccp0", index}, {"wccp1", unmarked}}));
+        EXPECT_NE(if_nametoindex("tun3"), 0u);
+        EXPECT_EQ(system("ip rule show preference 2051 | grep -q 192.0.2.8 && ip route show table 204806 | "
+                         "grep -q eth0 "
+                         "&& ip rule delete preference 2051 from 192.0.2.8 && ip link delete tun3 && "
+                         "ip route flush table 204806"),
+                  0);
+        std::string error;
+        EXPECT_TRUE(remove_kernel_state(tun_plane, &error)) << error;
+    });
+}
+
+TEST_F(kernel_state, settings_come_back) {
+    set("default/rp_filter", "2");
+    close(open_tun("lan1"));
+    set("lan1/rp_filter", "0");
+    appliance_view view = two_tunnels();
+    view.groups[61].routers[0].forward = travel::l2;
+    const auto wanted = make_wanted_state(view, {}, true);
+    run_program([&] {
+        EXPECT_EQ(reconcile(wanted), "");
+        EXPECT_EQ(get("all/rp_filter") + get("eth0/rp_filter") + get("lan1/rp_filter") +
+                      get("default/rp_filter"),
+                  "0112");
+        EXPECT_EQ(get("eth0/forwarding") + get("eth0/accept_local") + get("eth0/send_redirects"), "110");
+        EXPECT_EQ(get("lan1/send_redirects"), "1"); // as `all` had it
+    });
+    // Killed; and somebody has changed one of them, and written nonsense.
+    set("lan1/rp_filter", "2");
+    EXPECT_EQ(
+        system("(echo 'eth0/../../x 1 1'; echo 'all/rp_filter 1'; echo 'all/forwarding 1x 0'; head -c 5000 "
+               "/dev/zero) >>/run/tunneld/settings"),
+        0);
+    run_program([&] {
+        EXPECT_EQ(reconcile(wanted), ""); // what it finds is not what was before
+        view.groups[61].routers[0].forward = travel::gre;
+        EXPECT_EQ(reconcile(make_wanted_state(view, wanted.links, true)), "");
+        EXPECT_EQ(get("eth0/forwarding") + get("eth0/accept_local") + get("all/rp_filter") +
+                      get("eth0/rp_filter"),
+                  "0001");
+        std::string error;
+        EXPECT_TRUE(remove_kernel_state(tun_plane, &error)) << error;
+        EXPECT_EQ(get("all/rp_filter") + get("eth0/rp_filter") + get("lan1/rp_filter") +
+                      get("default/rp_filter"),
+                  "1022");
+        EXPECT_EQ(get("all/send_redirects") + get("eth0/send_redirects") + get("lan1/send_redirects"), "100");
+        EXPECT_EQ(system("ls /run/tunneld/* 2>/dev/null"), 2 << 8);
+    });
+    EXPECT_EQ(system("ip link delete lan1"), 0);
+}
+
+TEST_F(kernel_state, failures_are_reported_and_the_rest_is_done) {
+    run_program([] {
+        appliance_view view = two_tunnels();
+        view.groups[61].interface = "eth7"; // is not there
+        view.groups[61].force_l2_return = true;
+        const auto wanted = make_wanted_state(view, {}, true);
+        ASSERT_EQ(mount("/proc/sys", "/proc/sys", nullptr, MS_BIND, nullptr), 0);
+        ASSERT_EQ(mount(nullptr, "/proc/sys", nullptr, MS_BIND | MS_REMOUNT | MS_RDONLY, nullptr), 0);
+        EXPECT_EQ(reconcile(wanted),
+                  "cannot set /proc/sys/net/ipv4/conf/default/rp_filter to 1: Read-only file system");
+        EXPECT_EQ(umount("/proc/sys"), 0);
+        auto expected = links_and_tables(wanted);
+        EXPECT_EQ(expected.erase("route 204801 eth7 via 10.0.0.17"), 1u);
+        EXPECT_EQ(find_ours(), expected);
+        EXPECT_EQ(reconcile(wanted),
+                  "cannot add the default route of table 204801 (eth7 via 10.0.0.17): No such device");
+        EXPECT_EQ(get("wccp0/accept_local"), "1");
+    });
+}
+
+TEST_F(kernel_state, many_tunnels_in_time) {
+    appliance_view view;
+    for (uint16_t i = 0; i < 32; i++)
+        view.tunnels[i] = {LOCAL, R1 + i};
+    for (unsigned group = 0; group < 256; group++) {
+        const auto id = static_cast<uint8_t>(group);
+        view.groups[id] = {"eth0", LOCAL, 0, false, {{R1 + group % 32, R1, travel::l2, travel::gre}}};
+        view.intercepts[id].to = 3128;
+    }
+    run_program([&] {
+        const auto start = std::chrono::steady_clock::now();
+        const auto wanted = make_wanted_state(view, {}, true);
+        EXPECT_EQ(reconcile(wanted), "");
+        const std::chrono::duration<double> taken = std::chrono::steady_clock::now() - start;
+        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        EXPECT_EQ(wanted.sorting.groups.size(), 256u);
+        EXPECT_LT(taken.count(), 2.0);
+    });
+}
+
+TEST(kernel_plane, says_whether_the_kernel_has_gre) {
+    run_program([] {
+        std::string why;
+        const link_wish wish = {3, LOCAL, R1, false};
+        uint32_t index;
+        if (!kernel_plane.probe(&why)) {
+            EXPECT_EQ(why, "the kernel cannot make GRE links: Operation not supported");
+            EXPECT_FALSE(kernel_plane.make_link("wccp0", wish, &index, &why));
+            EXPECT_EQ(why, "cannot make link wccp0 (GRE 10.0.0.101 to 10.0.0.1): Operation not supported");
+        } else {
+            std::string error;
+            const auto wanted = make_wanted_state(two_tunnels(), {}, false);
+            for (int i = 0; i < 2; i++) {
+                EXPECT_TRUE(reconcile_kernel_state(kernel_plane, wanted, &indices, &error)) << error;
+                EXPECT_EQ(find_ours(), links_and_tables(wanted));
+            }
+            EXPECT_TRUE(remove_kernel_state(kernel_plane, &error)) << error;
+        }
+        EXPECT_EQ(find_ours(), std::set<std::string>());
+    });
+}
+
+} // namespace
