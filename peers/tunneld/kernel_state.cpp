@@ -76,7 +76,7 @@ bool make_room(const data_plane &plane, const wanted_link &link, found_link *fou
         *found = {};
     }
     const char *kind = &plane == &kernel_plane ? "gre" : "tun";
-    if (found->index && (found->kind != kind || (found->wish && !same_ends(*found->wish, link.wish)))) {
+    if (found->index && found->kind != kind) { // of the other plane
         const int error = remove_link(found->index);
         failed->note("cannot remove link " + link.name, error);
         if (error)
