@@ -1,0 +1,475 @@
+#include "peers/tunneld/sorting_text.h"
+
+#include <algorithm>
+#include <cctype>
+#include <cstdio>
+
+#include "peers/tunneld/sorting_rules.h"
+
+const char *const sorted_words[SORTED_WAYS] = {"in",   "to_proxy",  "bypassed", "returned",
+                                               "down", "forwarded", "dropped",  "own"};
+
+namespace {
+
+constexpr const char *JUST_SYN = "tcp flags & (fin | syn | rst | ack) == syn";
+constexpr const char *NOT_JUST_SYN = "tcp flags & (fin | syn | rst | ack) != syn";
+
+template <typename... T>
+std::string format(const char *text, T... values) {
+    char line[512];
+    const int length = snprintf(line, sizeof(line), text, values...);
+    return std::string(line, std::min<size_t>(static_cast<size_t>(length), sizeof(line) - 1));
+}
+
+std::string quoted(const std::string &text) {
+    return '"' + text + '"';
+}
+
+std::string interface_counter(const std::string &name, const char *way) {
+    return "interface/" + name + "/" + way;
+}
+
+std::string group_counter(uint8_t group, sorted_as way) {
+    return format("counter name \"group/%u/%s\"", group, sorted_words[way]);
+}
+
+std::string mark_as(uint32_t mark) {
+    return format("meta mark set 0x%08x", mark);
+}
+
+std::string group_chain(uint8_t group) {
+    return format("group/%u", group);
+}
+
+bool is_safe_name(const std::string &name) {
+    return !name.empty() && name.size() < 16 && std::all_of(name.begin(), name.end(), [](unsigned char c) {
+        return isalnum(c) || c == '.' || c == '-' || c == '_';
+    });
+}
+
+// Without prefixes that lie in others, which an interval set refuses.
+std::set<std::string> merge_prefixes(std::vector<ip_prefix> prefixes) {
+    const auto mask = [](uint8_t length) { return length == 0 ? 0 : ~0u << (32 - length); };
+    for (ip_prefix &prefix : prefixes)
+        prefix.address &= mask(prefix.length);
+    std::sort(prefixes.begin(), prefixes.end(), [](const ip_prefix &a, const ip_prefix &b) {
+        return a.address != b.address ? a.address < b.address : a.length < b.length;
+    });
+    std::set<std::string> merged;
+    const ip_prefix *last = nullptr;
+    for (const ip_prefix &prefix : prefixes) {
+        if (last && (prefix.address & mask(last->length)) == last->address)
+            continue;
+        last = &prefix;
+        merged.insert(address_text(prefix.address) + format("/%u", prefix.length));
+    }
+    return merged;
+}
+
+std::string join(const std::set<std::string> &words) {
+    std::string text;
+    for (const std::string &word : words)
+        text += (text.empty() ? "" : ", ") + word;
+    return text;
+}
+
+bool wants_something(const sorted_group &group) {
+    return group.rules.to != 0;
+}
+
+// Ranges of ports that are taken, by their first: the last, and the group that takes them.
+using taken_ports = std::map<uint32_t, std::pair<uint32_t, uint8_t>>;
+
+// What others have taken before stays theirs.
+void take_ports(taken_ports *taken, uint32_t first, uint32_t last, uint8_t group) {
+    while (first <= last) {
+        const auto next = taken->upper_bound(first);
+        if (next != taken->begin() && std::prev(next)->second.first >= first) {
+            first = std::prev(next)->second.first + 1;
+            continue;
+        }
+        const uint32_t end = next == taken->end() ? last : std::min(last, next->first - 1);
+        (*taken)[first] = {end, group};
+        first = end + 1;
+    }
+}
+
+// Everything below here fills one nft_content.
+struct content_maker {
+    const wanted_sorting &wanted;
+    nft_content &content;
+    std::set<std::string> interfaces; // all that packets are sorted from
+
+    std::vector<std::string> &rules(const std::string &chain) { return content.chains[chain].rules; }
+    void add_counter(const std::string &name) { content.counters.insert(name); }
+    nft_set &set(const std::string &name, const std::string &declaration) {
+        content.sets[name].declaration = declaration;
+        return content.sets[name];
+    }
+};
+
+// One for each way: counts it by the interface, and gives the packet its verdict and mark.
+void add_way_chains(content_maker &maker) {
+    for (const char *way : sorted_words) {
+        nft_set &map = maker.set(format("count_%s", way), "map { type ifname : counter; }");
+        for (const std::string &name : maker.interfaces) {
+            maker.add_counter(interface_counter(name, way));
+            map.elements[quoted(name)] = quoted(interface_counter(name, way));
+        }
+    }
+    nft_set &marks = maker.set("give_back", "map { type ifname : mark; }");
+    for (const auto &[name, mark] : maker.wanted.l2_into_gre)
+        marks.elements[quoted(name)] = format("0x%08x", mark);
+    const auto count = [](const char *way) { return format("counter name iifname map @count_%s", way); };
+    // A packet without a mark takes the way of its interface: back through a link, on from an L2 interface.
+    const std::string unmarked = format("meta mark != 0x%08x ", MARK_LOCAL);
+    for (const char *way : {"returned", "bypassed", "own", "down"})
+        maker.rules(way) = {count(way), unmarked + "meta mark set iifname map @give_back"};
+    maker.rules("to_proxy") = {mark_as(MARK_LOCAL), count("to_proxy")};
+    maker.rules("forwarded") = {unmarked + mark_as(MARK_FORWARD), count("forwarded")};
+    maker.rules("dropped") = {count("dropped"), "drop"};
+    maker.rules("down_dropped") = {count("down"), "drop"};
+}
+
+void add_group(content_maker &maker, const sorted_group &group) {
+    for (const sorted_as way :
+         {SORTED_TO_PROXY, SORTED_BYPASSED, SORTED_RETURNED, SORTED_DOWN, SORTED_FORWARDED, SORTED_DROPPED})
+        maker.add_counter(format("group/%u/%s", group.group, sorted_words[way]));
+    std::vector<std::string> &rules = maker.rules(group_chain(group.group));
+    const intercept &wish = group.rules;
+    const auto ends_as = [&](sorted_as way, const char *chain) {
+        return group_counter(group.group, way) + " goto " + chain;
+    };
+    if (!wish.bypass.empty())
+        for (const char *end : {"saddr", "daddr"})
+            rules.push_back(format("ip %s { ", end) + join(merge_prefixes(wish.bypass)) + " } " +
+                            ends_as(SORTED_BYPASSED, "bypassed"));
+    // A flow that began before it was redirected stays with its server.
+    if (wish.protocol == 6)
+        rules.push_back(NOT_JUST_SYN + (" " + ends_as(SORTED_RETURNED, "returned")));
+    if (!group.condition.active || !group.condition.proxy_up) {
+        const bool drop = group.condition.active && wish.drop_when_down;
+        rules.push_back(ends_as(SORTED_DOWN, drop ? "down_dropped" : "down"));
+        return;
+    }
+    // The proxy may listen on any address, on one of the interface, or on 127.0.0.1. The statement ends the
+    // rule when there is no such socket, and the next rule has its turn.
+    for (const char *address : {"", "127.0.0.1"})
+        rules.push_back(format("meta l4proto %u tproxy to %s:%u ", wish.protocol, address, wish.to) +
+                        ends_as(SORTED_TO_PROXY, "to_proxy"));
+    rules.push_back(ends_as(SORTED_RETURNED, "returned"));
+}
+
+// What happens to the packets of an interface that no group wants. Which group they were redirected for isn't
+// to be seen: they are forwarded or dropped only where all groups of the interface say it.
+std::string make_rest_rule(const std::vector<const sorted_group *> &groups) {
+    static constexpr struct {
+        leftover rest;
+        sorted_as way;
+    } ways[] = {{leftover::give_back, SORTED_RETURNED},
+                {leftover::forward, SORTED_FORWARDED},
+                {leftover::drop, SORTED_DROPPED}};
+    leftover rest = groups[0]->rules.rest;
+    for (const sorted_group *group : groups)
+        if (!wants_something(*group) || group->rules.rest != rest)
+            rest = leftover::give_back;
+    sorted_as way = SORTED_RETURNED;
+    for (const auto &row : ways)
+        if (row.rest == rest)
+            way = row.way;
+    std::string rule = std::string("goto ") + sorted_words[way];
+    if (groups.size() == 1 && wants_something(*groups[0]))
+        rule = group_counter(groups[0]->group, way) + " " + rule;
+    return rule;
+}
+
+// The chain for interfaces that have the same groups, named after the first of them.
+void add_class(content_maker &maker, const std::string &name,
+               const std::vector<const sorted_group *> &groups) {
+    std::vector<std::string> &rules = maker.rules("class/" + name);
+    for (const auto &[protocol, word] : {std::pair<uint8_t, const char *>{6, "tcp"}, {17, "udp"}}) {
+        taken_ports taken;
+        for (const sorted_group *group : groups) {
+            if (!wants_something(*group) || group->rules.protocol != protocol)
+                continue;
+            for (const port_range &range : group->rules.ports)
+                take_ports(&taken, range.first, range.last, group->group);
+            if (group->rules.ports.empty())
+                take_ports(&taken, 0, 65535, group->group);
+        }
+        if (taken.empty())
+            continue;
+        const std::string map_name = "ports/" + name + "/" + word;
+        nft_set &map = maker.set(map_name, "map { type inet_service : verdict; flags interval; }");
+        for (const auto &[first, end] : taken)
+            map.elements[first == end.first ? format("%u", first) : format("%u-%u", first, end.first)] =
+                "goto " + group_chain(end.second);
+        rules.push_back(std::string(word) + " dport vmap @" + map_name);
+    }
+    rules.push_back(make_rest_rule(groups));
+}
+
+void add_classes(content_maker &maker) {
+    std::map<std::string, std::vector<const sorted_group *>> groups_of;
+    for (const sorted_group &group : maker.wanted.groups)
+        for (const std::string &name : group.interfaces)
+            if (maker.interfaces.contains(name))
+                groups_of[name].push_back(&group);
+    nft_set &map = maker.set("classes", "map { type ifname : verdict; }");
+    std::map<std::vector<const sorted_group *>, std::string> classes;
+    for (const auto &[name, groups] : groups_of) {
+        const auto [at, is_new] = classes.emplace(groups, name);
+        if (is_new)
+            add_class(maker, name, groups);
+        map.elements[quoted(name)] = "goto class/" + at->second;
+    }
+}
+
+void add_arrival_chains(content_maker &maker) {
+    nft_set &arrivals = maker.set("arrivals", "map { type ifname : verdict; }");
+    for (const std::string &name : maker.wanted.l2_interfaces)
+        arrivals.elements[quoted(name)] = "goto arrived_l2";
+    for (const std::string &name : maker.wanted.links)
+        arrivals.elements[quoted(name)] = "goto arrived";
+    maker.content.chains["sort"] = {"type filter hook prerouting priority -150; policy accept;",
+                                    {"iifname vmap @arrivals"}};
+    maker.rules("arrived_l2") = {"fib daddr type != unicast accept", "meta pkttype != host accept",
+                                 "goto arrived"};
+    nft_set &own = maker.set("own_addresses", "set { type ipv4_addr; }");
+    for (const uint32_t address : maker.wanted.own_addresses)
+        own.elements[address_text(address)] = "";
+    for (const std::string &prefix : merge_prefixes(maker.wanted.bypasses))
+        maker.set("bypasses", "set { type ipv4_addr; flags interval; }").elements[prefix] = "";
+    maker.set("bypasses", "set { type ipv4_addr; flags interval; }");
+    maker.rules("arrived") = {
+        "counter name iifname map @count_in",
+        "ip saddr @own_addresses goto own",
+        JUST_SYN + std::string(" ip saddr . tcp sport . ip daddr . tcp dport @own_flows goto own"),
+        "socket transparent 1 socket wildcard 0 goto to_proxy",
+        // What is left has no socket, one that listens, or one that isn't whole yet or any more, of which
+        // `wildcard` is undefined. A SYN for the last kind begins a new flow, and TPROXY can handle it. If
+        // it isn't wanted, it still has to be delivered here: a packet that has a socket is not forwarded.
+        "socket wildcard 1 goto unclaimed",
+        NOT_JUST_SYN + std::string(" socket transparent 1 goto to_proxy"),
+        "socket transparent 1 " + mark_as(MARK_LOCAL),
+        "goto unclaimed",
+    };
+    maker.rules("unclaimed") = {"ip saddr @bypasses goto bypassed", "ip daddr @bypasses goto bypassed",
+                                "iifname vmap @classes", "goto returned"};
+}
+
+// Packets that this host sends: new flows from addresses that aren't ours are remembered, so that they are
+// known when a router redirects them, and answers in the name of a server announce a segment size that fits.
+void add_departure_chain(content_maker &maker) {
+    nft_set &flows = maker.set("own_flows", "set { type ipv4_addr . inet_service . ipv4_addr . inet_service; "
+                                            "flags dynamic, timeout; timeout 10s; size 65535; }");
+    flows.filled_by_rules = true;
+    maker.add_counter(CLAMPED_COUNTER);
+    nft_chain &chain = maker.content.chains["sent"];
+    chain.declaration = "type filter hook output priority -150; policy accept;";
+    chain.rules = {
+        JUST_SYN + std::string(" fib saddr type != local "
+                               "update @own_flows { ip saddr . tcp sport . ip daddr . tcp dport }"),
+    };
+    if (maker.wanted.mss != 0)
+        chain.rules.push_back(format("tcp flags & (fin | syn | rst | ack) == (syn | ack) "
+                                     "fib saddr type != local tcp option maxseg size > %u "
+                                     "tcp option maxseg size set %u counter name \"%s\"",
+                                     maker.wanted.mss, maker.wanted.mss, CLAMPED_COUNTER));
+}
+
+// Packets that still have their outer headers.
+void add_outer_chains(content_maker &maker) {
+    nft_set &ends = maker.set(ENDS_SET, "set { type ipv4_addr . ipv4_addr; }");
+    nft_set &locals = maker.set("local_ends", "set { type ipv4_addr; }");
+    nft_set &fragments = maker.set("count_fragments", "map { type ipv4_addr . ipv4_addr : counter; }");
+    maker.set(REFUSED_SET, "set { type ipv4_addr . ipv4_addr; flags dynamic; size 256; }").filled_by_rules =
+        true;
+    for (const tunnel_ends &pair : maker.wanted.ends) {
+        const std::string local = address_text(pair.local), remote = address_text(pair.remote);
+        const std::string counter = "fragments/" + local + "/" + remote;
+        maker.add_counter(counter);
+        fragments.elements[remote + " . " + local] = quoted(counter);
+        ends.elements[remote + " . " + local] = "";
+        locals.elements[local] = "";
+    }
+    // Before packets are put together again, at -400.
+    nft_chain &chain = maker.content.chains["outer"];
+    chain.declaration = "type filter hook prerouting priority -450; policy accept;";
+    chain.rules = {"ip protocol != gre accept",
+                   "ip frag-off & 0x3fff != 0 counter name ip saddr . ip daddr map @count_fragments"};
+    nft_chain &input = maker.content.chains["outer_input"];
+    input.declaration = "type filter hook input priority -150; policy accept;";
+    if (maker.wanted.drop_outer_gre)
+        input.rules = {"ip protocol gre ip daddr @local_ends drop"};
+    else // the user-space plane counts them itself
+        chain.rules.push_back(format("ip daddr @local_ends ip saddr . ip daddr != @%s "
+                                     "add @%s { ip saddr . ip daddr counter }",
+                                     ENDS_SET, REFUSED_SET));
+}
+
+bool check_sorting(const wanted_sorting &wanted, std::string *out_error) {
+    std::vector<std::string> names = wanted.links;
+    names.insert(names.end(), wanted.l2_interfaces.begin(), wanted.l2_interfaces.end());
+    for (const auto &[name, mark] : wanted.l2_into_gre)
+        names.push_back(name);
+    for (const std::string &name : names)
+        if (!is_safe_name(name)) {
+            *out_error = "interface name \"" + name + "\" cannot be used in rules";
+            return false;
+        }
+    for (const sorted_group &group : wanted.groups) {
+        bool good = group.rules.protocol == 6 || group.rules.protocol == 17;
+        for (const port_range &range : group.rules.ports)
+            good &= range.first <= range.last;
+        for (const ip_prefix &prefix : group.rules.bypass)
+            good &= prefix.length <= 32;
+        if (!good) {
+            *out_error = format("intercept of group %u: bad protocol, ports or prefix", group.group);
+            return false;
+        }
+    }
+    for (const ip_prefix &prefix : wanted.bypasses)
+        if (prefix.length > 32) {
+            *out_error = "bypass: bad prefix length";
+            return false;
+        }
+    return true;
+}
+
+} // namespace
+
+std::string address_text(uint32_t address) {
+    return format("%u.%u.%u.%u", address >> 24, address >> 16 & 255, address >> 8 & 255, address & 255);
+}
+
+bool make_sorting_content(const wanted_sorting &wanted, nft_content *out, std::string *out_error) {
+    *out = {};
+    if (!check_sorting(wanted, out_error))
+        return false;
+    if (wanted.links.empty() && wanted.l2_interfaces.empty() && wanted.groups.empty() && wanted.ends.empty())
+        return true;
+    content_maker maker{wanted, *out, {}};
+    maker.interfaces.insert(wanted.links.begin(), wanted.links.end());
+    maker.interfaces.insert(wanted.l2_interfaces.begin(), wanted.l2_interfaces.end());
+    add_way_chains(maker);
+    for (const sorted_group &group : wanted.groups)
+        if (wants_something(group))
+            add_group(maker, group);
+    add_classes(maker);
+    add_arrival_chains(maker);
+    add_departure_chain(maker);
+    add_outer_chains(maker);
+    return true;
+}
+
+namespace {
+
+struct transaction {
+    std::string text;
+    void add(const char *what, const std::string &name, const std::string &more = "") {
+        text +=
+            std::string(what) + " ip " + RULES_TABLE + " " + name + (more.empty() ? "" : " ") + more + "\n";
+    }
+};
+
+std::string kind_of(const nft_set &set) {
+    return set.declaration.substr(0, set.declaration.find(' '));
+}
+
+void change_elements(transaction &change, const char *verb, const std::string &name,
+                     const std::map<std::string, std::string> &elements) {
+    if (elements.empty())
+        return;
+    std::string list;
+    for (const auto &[key, value] : elements)
+        list += (list.empty() ? "{ " : ", ") + key + (value.empty() ? "" : " : " + value);
+    change.add(verb, name, list + " }");
+}
+
+// Elements of `before` that are not the same in `after`.
+std::map<std::string, std::string> missing_elements(const nft_set &before, const nft_set &after) {
+    std::map<std::string, std::string> missing;
+    for (const auto &element : before.elements) {
+        const auto at = after.elements.find(element.first);
+        if (at == after.elements.end() || at->second != element.second)
+            missing.insert(element);
+    }
+    return missing;
+}
+
+// Elements that go, before those that come: a set is changed within the transaction, never seen in between.
+void change_set(transaction &change, const std::string &name, const nft_set *before, const nft_set &after,
+                bool known) {
+    if (after.filled_by_rules)
+        return;
+    if (!before) {
+        change_elements(change, "add element", name, after.elements);
+        return;
+    }
+    if (!known) {
+        change.add(("flush " + kind_of(after)).c_str(), name);
+        change_elements(change, "add element", name, after.elements);
+        return;
+    }
+    change_elements(change, "delete element", name, missing_elements(*before, after));
+    change_elements(change, "add element", name, missing_elements(after, *before));
+}
+
+template <typename V>
+const V *find_in(const std::map<std::string, V> &map, const std::string &name) {
+    const auto at = map.find(name);
+    return at == map.end() ? nullptr : &at->second;
+}
+
+} // namespace
+
+// What is referred to comes before what refers to it, and goes after it.
+std::string make_sorting_transaction(const nft_content &before, const nft_content &after) {
+    if (before == after)
+        return "";
+    transaction change;
+    if (after.empty()) {
+        change.text = std::string("delete table ip ") + RULES_TABLE + "\n";
+        return change.text;
+    }
+    if (before.empty())
+        change.text = std::string("add table ip ") + RULES_TABLE + "\n";
+    for (const std::string &name : after.counters)
+        if (!before.counters.contains(name))
+            change.add("add counter", name);
+    for (const auto &[name, chain] : after.chains)
+        if (!before.chains.contains(name))
+            change.add("add chain", name, chain.declaration.empty() ? "" : "{ " + chain.declaration + " }");
+    for (const auto &[name, chain] : before.chains) {
+        const nft_chain *wanted = find_in(after.chains, name);
+        if (!before.known || !wanted || wanted->rules != chain.rules)
+            change.add("flush chain", name);
+    }
+    for (const auto &[name, set] : after.sets)
+        if (!before.sets.contains(name)) {
+            const size_t body = set.declaration.find(' ');
+            change.add(("add " + kind_of(set)).c_str(), name, set.declaration.substr(body + 1));
+        }
+    for (const auto &[name, set] : before.sets)
+        if (!after.sets.contains(name) && !set.filled_by_rules)
+            change.add(("flush " + kind_of(set)).c_str(), name);
+    for (const auto &[name, set] : after.sets)
+        change_set(change, name, find_in(before.sets, name), set, before.known);
+    for (const auto &[name, chain] : after.chains) {
+        const nft_chain *old = find_in(before.chains, name);
+        if (!before.known || !old || old->rules != chain.rules)
+            for (const std::string &rule : chain.rules)
+                change.add("add rule", name, rule);
+    }
+    for (const auto &[name, chain] : before.chains)
+        if (!after.chains.contains(name))
+            change.add("delete chain", name);
+    for (const auto &[name, set] : before.sets)
+        if (!after.sets.contains(name))
+            change.add(("delete " + kind_of(set)).c_str(), name);
+    for (const std::string &name : before.counters)
+        if (!after.counters.contains(name))
+            change.add("delete counter", name);
+    return change.text;
+}

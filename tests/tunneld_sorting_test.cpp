@@ -1,0 +1,587 @@
+// The sorting rules on the kernel itself: packets come in by TUN devices in the place of a link, of an L2
+// interface and of the way to the clients, and a proxy's sockets listen.
+
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <linux/if.h>
+#include <linux/if_tun.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <poll.h>
+#include <sys/ioctl.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <functional>
+
+#include "peers/tunneld/nft_commands.h"
+#include "peers/tunneld/sorting_rules.h"
+
+namespace {
+
+constexpr uint8_t FIN = 1, SYN = 2, ACK = 16;
+constexpr uint32_t CLIENT = 0xAC100005, SERVER = 0xC6336405, OWN = 0x0A000001, ROUTER = 0xC0000201;
+constexpr uint32_t SPARED = 0x0A090101, BYPASSED = 0xCB007107; // in a group's bypass, in that of all
+
+struct packet {
+    uint32_t source = CLIENT, destination = SERVER;
+    uint8_t protocol = 6, flags = SYN;
+    uint16_t port = 80, from = 0; // 0: one that no other packet has had
+    uint32_t sequence = 1, acknowledged = 0;
+    std::string text = "";
+};
+
+uint16_t checksum(const std::string &bytes, uint32_t sum = 0) {
+    for (size_t i = 0; i < bytes.size(); i++)
+        sum += static_cast<uint8_t>(bytes[i]) << (i % 2 ? 0 : 8);
+    while (sum >> 16)
+        sum = (sum & 0xffff) + (sum >> 16);
+    return static_cast<uint16_t>(~sum);
+}
+void put(std::string &bytes, uint64_t value, int size) {
+    while (size-- > 0)
+        bytes += static_cast<char>(value >> (8 * size));
+}
+uint32_t get(const std::string &bytes, size_t at, size_t size) {
+    uint32_t value = 0;
+    for (size_t i = at; i < at + size && i < bytes.size(); i++)
+        value = value << 8 | static_cast<uint8_t>(bytes[i]);
+    return value;
+}
+std::string ip_packet(uint32_t source, uint32_t destination, uint8_t protocol, const std::string &body,
+                      uint16_t fragment = 0) {
+    std::string bytes;
+    put(bytes, 0x4500, 2);
+    put(bytes, 20 + body.size(), 2);
+    put(bytes, 7, 2);
+    put(bytes, fragment, 2);
+    put(bytes, 64 << 8 | protocol, 2);
+    put(bytes, 0, 2);
+    put(bytes, source, 4);
+    put(bytes, destination, 4);
+    const uint16_t sum = checksum(bytes);
+    bytes[10] = static_cast<char>(sum >> 8);
+    bytes[11] = static_cast<char>(sum);
+    return bytes + body;
+}
+std::string make_bytes(const packet &what) {
+    std::string body;
+    put(body, what.from, 2);
+    put(body, what.port, 2);
+    size_t sum_at = 6;
+    if (what.protocol == 17) {
+        put(body, 8 + what.text.size(), 2);
+        put(body, 0, 2);
+    } else {
+        const bool syn = what.flags & SYN;
+        put(body, what.sequence, 4);
+        put(body, what.acknowledged, 4);
+        put(body, (syn ? 6 : 5) << 12 | what.flags, 2);
+        put(body, 65535, 2);
+        put(body, 0, 4);
+        if (syn)
+            put(body, 0x020405B4, 4);
+        sum_at = 16;
+    }
+    body += what.text;
+    std::string pseudo;
+    put(pseudo, what.source, 4);
+    put(pseudo, what.destination, 4);
+    put(pseudo, what.protocol, 2);
+    put(pseudo, body.size(), 2);
+    const uint16_t sum = checksum(pseudo + body);
+    body[sum_at] = static_cast<char>(sum >> 8);
+    body[sum_at + 1] = static_cast<char>(sum);
+    return ip_packet(what.source, what.destination, what.protocol, body);
+}
+
+enum device { LINK, LAN, OUT, DEVICES };
+constexpr const char *device_names[DEVICES] = {"wccp0", "lan0", "out0"};
+int devices[DEVICES];
+uint16_t next_port = 20000;
+
+int open_tun(const char *name) {
+    const int fd = open("/dev/net/tun", O_RDWR | O_NONBLOCK | O_CLOEXEC);
+    ifreq request{};
+    strncpy(request.ifr_name, name, IFNAMSIZ - 1);
+    request.ifr_flags = IFF_TUN | IFF_NO_PI;
+    return ioctl(fd, TUNSETIFF, &request) == 0 ? fd : -1;
+}
+
+void give(device where, const std::string &bytes) {
+    ASSERT_EQ(write(devices[where], bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+}
+
+// The next packet out of any device that `wanted` takes. What becomes of a packet is settled when it has been
+// written, up to the answer: the wait is for a busy machine.
+std::string take(const std::function<bool(const std::string &)> &wanted, device *out_where, int ms = 60) {
+    pollfd fds[DEVICES];
+    for (int i = 0; i < DEVICES; i++)
+        fds[i] = {devices[i], POLLIN, 0};
+    while (poll(fds, DEVICES, ms) > 0)
+        for (int i = 0; i < DEVICES; i++) {
+            char buffer[2048];
+            const ssize_t length = fds[i].revents ? read(devices[i], buffer, sizeof(buffer)) : 0;
+            const std::string bytes(buffer, length > 0 ? static_cast<size_t>(length) : 0);
+            *out_where = static_cast<device>(i);
+            if (!bytes.empty() && bytes[0] == 0x45 && wanted(bytes))
+                return bytes;
+        }
+    return "";
+}
+
+void drain() {
+    device where;
+    take([](const std::string &) { return false; }, &where, 0);
+}
+
+int listen_on(int type, uint32_t address, uint16_t port) {
+    const int fd = socket(AF_INET, type | SOCK_NONBLOCK | SOCK_CLOEXEC, 0), on = 1;
+    setsockopt(fd, IPPROTO_IP, IP_TRANSPARENT, &on, sizeof(on));
+    sockaddr_in name{};
+    name.sin_family = AF_INET;
+    name.sin_addr.s_addr = htonl(address);
+    name.sin_port = htons(port);
+    EXPECT_EQ(bind(fd, reinterpret_cast<sockaddr *>(&name), sizeof(name)), 0) << strerror(errno);
+    if (type == SOCK_STREAM)
+        listen(fd, 100);
+    return fd;
+}
+
+sorted_group make_group(uint8_t number, uint8_t protocol, std::vector<port_range> ports) {
+    sorted_group group{number, {}, {true, true}, {"wccp0"}};
+    group.rules.protocol = protocol;
+    group.rules.ports = std::move(ports);
+    group.rules.to = 3128;
+    return group;
+}
+
+wanted_sorting make_wanted() {
+    wanted_sorting wanted;
+    wanted.links = {"wccp0"};
+    wanted.l2_interfaces = {"lan0"};
+    wanted.groups = {make_group(5, 6, {{80, 80}, {8000, 8080}}), make_group(6, 17, {{53, 53}}),
+                     make_group(7, 6, {{8040, 8100}})}; // in part taken by group 5
+    wanted.groups[0].interfaces = {"wccp0", "lan0"};
+    wanted.groups[0].rules.bypass = {{SPARED, 16}, {SPARED, 24}};
+    wanted.bypasses = {{BYPASSED, 24}, {BYPASSED, 32}};
+    wanted.own_addresses = {OWN};
+    wanted.ends = {{OWN, ROUTER}};
+    wanted.mss = 1400;
+    return wanted;
+}
+
+struct Sorting : testing::Test {
+    static void SetUpTestSuite() {
+        for (int i = 0; i < DEVICES; i++)
+            ASSERT_GE(devices[i] = open_tun(device_names[i]), 0);
+        ASSERT_EQ(
+            system(
+                "set -e; cd /proc/sys/net/ipv4/conf; echo 0 >all/rp_filter; ip addr add 10.0.0.1/32 dev lo\n"
+                "for d in wccp0 lan0 out0; do echo 1 >$d/forwarding; echo 0 >$d/rp_filter\n"
+                "    echo 1 >$d/accept_local; ip link set $d up; done\n"
+                "ip route add default dev out0; ip route add local default dev lo table 204800\n"
+                "ip route add default dev wccp0 table 204801\n"
+                "ip rule add pref 2048 fwmark 0x57430001 lookup 204800\n"
+                "ip rule add pref 2049 fwmark 0x57430002 lookup main\n"
+                "ip rule add pref 2050 fwmark 0x57430100 lookup 204801\n"
+                "ip rule add pref 2051 iif wccp0 lookup 204801"),
+            0);
+        listen_on(SOCK_STREAM, INADDR_ANY, 3128);
+        listen_on(SOCK_STREAM, INADDR_LOOPBACK, 3129);
+        udp = listen_on(SOCK_DGRAM, INADDR_ANY, 3128);
+    }
+    ~Sorting() override {
+        std::string error;
+        EXPECT_TRUE(remove_sorting_rules(&error) && remove_sorting_rules(&error)) << error;
+        EXPECT_EQ(system("[ -z \"$(nft list ruleset)\" ]"), 0);
+    }
+    static void apply(const wanted_sorting &wanted) {
+        std::string error;
+        EXPECT_TRUE(apply_sorting_rules(wanted, &error)) << error;
+    }
+    static sorting_counters counters() {
+        sorting_counters read;
+        std::string error;
+        EXPECT_TRUE(read_sorting_counters(&read, &error)) << error;
+        return read;
+    }
+    // Gives a packet, and says what came of it: the device that it came out of, "answer" from the proxy's TCP
+    // socket, "datagram" at the UDP socket, or "".
+    static std::string send(packet what, device by = LINK, std::string *out_answer = nullptr) {
+        if (what.from == 0)
+            what.from = next_port++;
+        drain();
+        give(by, make_bytes(what));
+        device where = DEVICES;
+        const std::string got = take(
+            [&](const std::string &bytes) {
+                return bytes.size() >= 28 &&
+                       (get(bytes, 20, 2) == what.from || get(bytes, 22, 2) == what.from);
+            },
+            &where);
+        char buffer[64];
+        if (what.protocol == 17 && recv(udp, buffer, sizeof(buffer), 0) >= 0)
+            return "datagram";
+        if (got.empty() || get(got, 20, 2) == what.from)
+            return got.empty() ? "" : device_names[where];
+        if (out_answer)
+            *out_answer = got;
+        return get(got, 33, 1) == (SYN | ACK) ? "answer" : "refused";
+    }
+    static int udp;
+};
+int Sorting::udp;
+
+} // namespace
+
+TEST_F(Sorting, PacketsGoWhereTheyShould) {
+    using W = wanted_sorting;
+    static const struct {
+        const char *what;
+        std::function<void(W &)> change;
+        packet given;
+        device by;
+        const char *outcome;
+        sorted_as way;
+        int group; // whose counter counts it as well; 0: none
+    } rows[] = {
+        {"a new flow", {}, {}, LINK, "answer", SORTED_TO_PROXY, 5},
+        {"taken by the first group", {}, {.port = 8040}, LINK, "answer", SORTED_TO_PROXY, 5},
+        {"left for the second", {}, {.port = 8100}, LINK, "answer", SORTED_TO_PROXY, 7},
+        {"a datagram", {}, {.protocol = 17, .port = 53}, LINK, "datagram", SORTED_TO_PROXY, 6},
+        {"another port", {}, {.port = 443}, LINK, "wccp0", SORTED_RETURNED, 0},
+        {"another protocol", {}, {.protocol = 47}, LINK, "wccp0", SORTED_RETURNED, 0},
+        {"an older flow", {}, {.flags = ACK}, LINK, "wccp0", SORTED_RETURNED, 5},
+        {"all ports",
+         [](W &w) { w.groups[0].rules.ports.clear(); },
+         {.port = 65535},
+         LINK,
+         "answer",
+         SORTED_TO_PROXY,
+         5},
+        {"by L2", {}, {}, LAN, "answer", SORTED_TO_PROXY, 5},
+        {"by L2, another port", {}, {.port = 443}, LAN, "out0", SORTED_RETURNED, 5},
+        {"by L2, back through GRE",
+         [](W &w) {
+             w.l2_into_gre = {{"lan0", MARK_RETURN}};
+         },
+         {.port = 443},
+         LAN,
+         "wccp0",
+         SORTED_RETURNED,
+         5},
+        {"by L2, to this host", {}, {.destination = OWN}, LAN, "refused", SORTED_WAYS, 0},
+        {"a spared server", {}, {.destination = SPARED}, LINK, "wccp0", SORTED_BYPASSED, 5},
+        {"a spared client", {}, {.source = SPARED}, LINK, "wccp0", SORTED_BYPASSED, 5},
+        {"a bypassed server", {}, {.destination = BYPASSED}, LINK, "wccp0", SORTED_BYPASSED, 0},
+        {"no bypass any more",
+         [](W &w) {
+             w.bypasses = {{CLIENT, 32}};
+         },
+         {.source = BYPASSED},
+         LINK,
+         "answer",
+         SORTED_TO_PROXY,
+         5},
+        {"everything bypassed",
+         [](W &w) {
+             w.bypasses = {{0, 0}};
+         },
+         {},
+         LINK,
+         "wccp0",
+         SORTED_BYPASSED,
+         0},
+        {"proxy down",
+         [](W &w) { w.groups[0].condition.proxy_up = false; },
+         {},
+         LINK,
+         "wccp0",
+         SORTED_DOWN,
+         5},
+        {"fail closed",
+         [](W &w) { w.groups[0].condition.proxy_up = false, w.groups[0].rules.drop_when_down = true; },
+         {},
+         LINK,
+         "",
+         SORTED_DOWN,
+         5},
+        {"not active",
+         [](W &w) { w.groups[0].condition.active = false, w.groups[0].rules.drop_when_down = true; },
+         {},
+         LINK,
+         "wccp0",
+         SORTED_DOWN,
+         5},
+        {"nobody listens", [](W &w) { w.groups[0].rules.to = 3999; }, {}, LINK, "wccp0", SORTED_RETURNED, 5},
+        {"a proxy on loopback",
+         [](W &w) { w.groups[0].rules.to = 3129; },
+         {},
+         LINK,
+         "answer",
+         SORTED_TO_PROXY,
+         5},
+        {"own traffic", {}, {.source = OWN}, LINK, "wccp0", SORTED_OWN, 0},
+        {"forwarded",
+         [](W &w) {
+             for (auto &g : w.groups)
+                 g.rules.rest = leftover::forward;
+         },
+         {.port = 443},
+         LINK,
+         "out0",
+         SORTED_FORWARDED,
+         0},
+        {"dropped",
+         [](W &w) { w.groups[0].rules.rest = leftover::drop; },
+         {.port = 443},
+         LAN,
+         "",
+         SORTED_DROPPED,
+         5},
+        {"not all groups drop",
+         [](W &w) { w.groups[0].rules.rest = leftover::drop; },
+         {.port = 443},
+         LINK,
+         "wccp0",
+         SORTED_RETURNED,
+         0},
+        {"one without an intercept",
+         [](W &w) {
+             w.groups[0].rules.rest = leftover::drop;
+             w.groups[1].rules.to = 0;
+             w.groups[1].interfaces = {"lan0"};
+         },
+         {.port = 443},
+         LAN,
+         "out0",
+         SORTED_RETURNED,
+         0},
+        {"no groups", [](W &w) { w.groups.clear(); }, {}, LINK, "wccp0", SORTED_RETURNED, 0},
+    };
+    for (const auto &row : rows) {
+        SCOPED_TRACE(row.what);
+        wanted_sorting wanted = make_wanted();
+        if (row.change)
+            row.change(wanted);
+        apply(wanted);
+        sorting_counters before = counters();
+        EXPECT_EQ(send(row.given, row.by), row.outcome);
+        sorting_counters after = counters();
+        for (int way = 0; way < SORTED_WAYS; way++) {
+            const bool counted = row.way != SORTED_WAYS && (way == SORTED_IN || way == row.way);
+            const char *name = device_names[row.by];
+            EXPECT_EQ(after.interfaces[name][way].packets - before.interfaces[name][way].packets, counted)
+                << sorted_words[way];
+            for (const sorted_group &group : wanted.groups)
+                EXPECT_EQ(after.groups[group.group][way].packets - before.groups[group.group][way].packets,
+                          counted && group.group == row.group)
+                    << sorted_words[way] << " of group " << static_cast<int>(group.group);
+        }
+    }
+}
+
+TEST_F(Sorting, AFlowStaysWithItsSocket) {
+    const int listener = listen_on(SOCK_STREAM, INADDR_ANY, 3130);
+    wanted_sorting wanted = make_wanted();
+    wanted.groups[0].rules.to = 3130;
+    apply(wanted);
+    packet next{.from = next_port++};
+    std::string answer;
+    ASSERT_EQ(send(next, LINK, &answer), "answer");
+    EXPECT_EQ(get(answer, 40, 4), 0x02040000u | wanted.mss); // the option of a SYN-ACK that fits the tunnel
+    EXPECT_EQ(counters().clamped, 1);
+    // Its other packets need no rule of a group.
+    wanted.groups[0].condition.proxy_up = false;
+    wanted.bypasses = {{0, 0}};
+    apply(wanted);
+    next.flags = ACK;
+    next.sequence = 2;
+    next.acknowledged = get(answer, 24, 4) + 1;
+    EXPECT_EQ(send(next), "");
+    next.text = "hello";
+    EXPECT_EQ(send(next), "refused"); // acknowledged
+    const int flow = accept(listener, nullptr, nullptr);
+    char buffer[16];
+    EXPECT_EQ(recv(flow, buffer, sizeof(buffer), 0), 5);
+    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_TO_PROXY].packets, 3);
+    // The proxy closes first, and what remains of the flow is no whole socket: the client's FIN belongs to
+    // it. A next flow from the same port is the proxy's again, or is told that the old one isn't over.
+    close(flow);
+    next.sequence += 5;
+    next.acknowledged++;
+    next.text = "";
+    next.flags = FIN | ACK;
+    send(next);
+    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_TO_PROXY].packets, 4);
+    next.flags = SYN;
+    next.sequence += 100000;
+    EXPECT_EQ(send(next), "refused");
+    wanted = make_wanted();
+    wanted.groups[0].rules.to = 3130;
+    apply(wanted);
+    EXPECT_EQ(send(next), "answer");
+    close(listener);
+}
+
+TEST_F(Sorting, TheProxysOwnFlowIsKnownAgain) {
+    apply(make_wanted());
+    const uint16_t port = next_port++;
+    const int client = socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0), on = 1;
+    setsockopt(client, IPPROTO_IP, IP_TRANSPARENT, &on, sizeof(on));
+    sockaddr_in name{};
+    name.sin_family = AF_INET;
+    name.sin_addr.s_addr = htonl(CLIENT);
+    name.sin_port = htons(port);
+    ASSERT_EQ(bind(client, reinterpret_cast<sockaddr *>(&name), sizeof(name)), 0);
+    name.sin_addr.s_addr = htonl(SERVER);
+    name.sin_port = htons(80);
+    connect(client, reinterpret_cast<sockaddr *>(&name), sizeof(name));
+    device where = DEVICES;
+    const auto is_its_own = [&](const std::string &bytes) { return get(bytes, 20, 2) == port; };
+    const std::string syn = take(is_its_own, &where);
+    ASSERT_EQ(where, OUT);
+    give(LINK, syn);
+    EXPECT_EQ(take(is_its_own, &where).size(), syn.size());
+    EXPECT_EQ(where, LINK);
+    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_OWN].packets, 1);
+    EXPECT_EQ(send({}), "answer"); // others of the same addresses are not
+    close(client);
+}
+
+TEST_F(Sorting, OuterPacketsAreCounted) {
+    wanted_sorting wanted = make_wanted();
+    const std::string gre = ip_packet(ROUTER, OWN, 47, std::string("\0\0\x08\0", 4) + make_bytes({}));
+    const std::string strange = ip_packet(ROUTER + 1, OWN, 47, std::string("\0\0\x08\0", 4) + make_bytes({}));
+    const auto is_icmp = [](const std::string &bytes) { return bytes[9] == 1; };
+    device where;
+    for (const bool drop : {false, true}) {
+        wanted.drop_outer_gre = drop;
+        apply(wanted);
+        drain();
+        give(OUT, gre);
+        EXPECT_EQ(take(is_icmp, &where).empty(), drop); // protocol unreachable: this kernel has no GRE
+        give(OUT, strange);
+        give(OUT, ip_packet(ROUTER, OWN, 47, std::string(64, 'x'), 0x2000));
+        give(OUT, ip_packet(ROUTER, OWN, 47, std::string(64, 'x'), 8));
+    }
+    sorting_counters read = counters();
+    EXPECT_EQ(read.fragments, (std::map<tunnel_ends, uint64_t>{{{OWN, ROUTER}, 4}}));
+    EXPECT_EQ(read.refused_sources, (std::map<uint32_t, uint64_t>{{ROUTER + 1, 1}}));
+    wanted.ends.push_back({OWN, ROUTER + 1}); // is accepted from now on
+    apply(wanted);
+    EXPECT_TRUE(counters().refused_sources.empty());
+}
+
+// What a killed tunneld has left is taken over with its counters; a change that the kernel refuses changes
+// nothing; a table that somebody else has removed comes back.
+TEST_F(Sorting, ChangesAreWholeOrNone) {
+    wanted_sorting wanted = make_wanted();
+    std::string error;
+    EXPECT_TRUE(remove_sorting_rules(&error)) << error;
+    const pid_t child = fork();
+    if (child == 0) {
+        wanted_sorting earlier = make_wanted();
+        earlier.links = {"wccp0", "wccp9"};
+        earlier.groups[0].interfaces.push_back("wccp9");
+        earlier.groups.push_back(make_group(9, 6, {}));
+        apply(earlier);
+        _exit(send({.port = 443}) == "answer" && send({}) == "answer" ? 0 : 1);
+    }
+    int status = -1;
+    waitpid(child, &status, 0);
+    next_port += 2;
+    ASSERT_EQ(status, 0);
+    apply(wanted);
+    sorting_counters read = counters();
+    EXPECT_EQ(read.interfaces["wccp0"][SORTED_TO_PROXY].packets, 2);
+    EXPECT_EQ(read.groups[5][SORTED_TO_PROXY].packets, 1);
+    EXPECT_EQ(read.interfaces.size(), 2);
+    EXPECT_FALSE(read.groups.contains(9));
+    EXPECT_EQ(send({.port = 443}), "wccp0");
+
+    wanted.groups[0].condition.proxy_up = false;
+    ASSERT_EQ(seteuid(65534), 0);
+    EXPECT_FALSE(apply_sorting_rules(wanted, &error));
+    ASSERT_EQ(seteuid(0), 0);
+    EXPECT_NE(error.find("Operation not permitted"), std::string::npos) << error;
+    EXPECT_EQ(error.find('\n'), std::string::npos) << error;
+    EXPECT_EQ(send({}), "answer");
+    for (const char *name : {"a b", "x\"", "*", ""}) {
+        wanted_sorting bad = wanted;
+        bad.links.push_back(name);
+        EXPECT_FALSE(apply_sorting_rules(bad, &error));
+    }
+    EXPECT_EQ(send({}), "answer");
+    apply(wanted);
+    EXPECT_EQ(send({}), "wccp0");
+    EXPECT_EQ(counters().groups[5][SORTED_TO_PROXY].packets, 3);
+
+    for (const bool changed : {false, true}) {
+        ASSERT_TRUE(run_nft("flush ruleset", &error)) << error;
+        wanted.groups[0].condition.proxy_up = changed;
+        apply(wanted);
+        EXPECT_EQ(send({}), changed ? "answer" : "wccp0");
+    }
+    // A table of that name with something else in it gives way.
+    EXPECT_TRUE(remove_sorting_rules(&error)) << error;
+    ASSERT_TRUE(run_nft("add table ip tunneld\nadd map ip tunneld arrivals { type ipv4_addr : verdict; }\n"
+                        "add set ip tunneld classes { type mark; }\n",
+                        &error))
+        << error;
+    apply(wanted);
+    EXPECT_EQ(send({}), "answer");
+    apply({});
+    EXPECT_TRUE(counters().interfaces.empty());
+    EXPECT_EQ(probe_sorting_rules(), "");
+}
+
+// Also where each link has groups of its own.
+TEST_F(Sorting, ManyLinksAndGroupsAreQuick) {
+    for (const bool different : {false, true}) {
+        wanted_sorting wanted = make_wanted();
+        wanted.groups.clear();
+        for (unsigned i = 0; i < 32; i++) {
+            wanted.links.push_back("wccp" + std::to_string(i));
+            wanted.ends.push_back({OWN, ROUTER + i});
+        }
+        for (unsigned i = 0; i < 256; i++) {
+            const uint16_t port = static_cast<uint16_t>(1000 + 10 * i);
+            wanted.groups.push_back(make_group(static_cast<uint8_t>(i), i % 4 ? 6 : 17, {{port, port}}));
+            wanted.groups[i].rules.bypass = {{SPARED, 16}};
+            wanted.groups[i].interfaces.clear();
+            for (unsigned link = 0; link < 32; link++)
+                if (!different || (i >> link % 8 & 1) != link / 8 % 2)
+                    wanted.groups[i].interfaces.push_back("wccp" + std::to_string(link));
+        }
+        const auto timed = [&](const char *what, int64_t limit_ms) {
+            const auto begin = std::chrono::steady_clock::now();
+            apply(wanted);
+            const std::chrono::duration<double, std::milli> took = std::chrono::steady_clock::now() - begin;
+            printf("%s%s: %.1f ms\n", what, different ? ", all different" : "", took.count());
+            EXPECT_LT(took.count(), limit_ms) << what;
+        };
+        timed("first", 2000);
+        EXPECT_EQ(send({.port = 1000 + 10 * 129}), "answer");
+        for (const bool up : {false, true}) {
+            wanted.groups[129].condition.proxy_up = up;
+            timed("a proxy up or down", 500);
+        }
+        EXPECT_EQ(send({.port = 1000 + 10 * 129}), "answer");
+        wanted.bypasses.push_back({CLIENT, 32});
+        timed("a bypass", 500);
+        EXPECT_EQ(send({.port = 1000 + 10 * 129}), "wccp0");
+        std::string error;
+        const auto begin = std::chrono::steady_clock::now();
+        counters();
+        printf("reading: %.1f ms\n",
+               std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - begin).count());
+        EXPECT_TRUE(remove_sorting_rules(&error)) << error;
+    }
+}
