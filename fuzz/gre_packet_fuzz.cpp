@@ -1,0 +1,275 @@
+// The packet path of the user-space data plane, without the kernel: what comes in GRE is read, merged,
+// written into memory, split again and compared; and what a TUN device might return is split.
+//
+// An input is a mode byte and then, by its lowest bit, frames or one read of a TUN device. A frame is a
+// length of 16 bits and so many bytes of GRE; a length with the highest bit set repeats the last frame as the
+// next segments of its flow. All packets lie in memory of exactly their size.
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <map>
+#include <memory>
+#include <vector>
+
+#include "peers/tunneld/coalesce.h"
+#include "peers/tunneld/gre.h"
+
+namespace {
+
+enum mode : uint8_t {
+    TUN_READ = 1,
+    MENDED = 2,     // lengths and checksums inside, as far as they can be
+    UDP_MERGED = 4, // the device takes large UDP packets
+    FLUSHED = 8,    // after each fifth frame
+};
+constexpr size_t MAX_FRAMES = 300;
+using bytes = std::vector<uint8_t>;
+
+void require(bool condition, const char *what) {
+    if (condition)
+        return;
+    fprintf(stderr, "the packet path is not as it should be: %s\n", what);
+    abort();
+}
+#define REQUIRE(condition) require((condition), #condition)
+
+struct exact_memory {
+    explicit exact_memory(const bytes &content) : length(content.size()), memory(new uint8_t[length]) {
+        if (length)
+            memcpy(memory.get(), content.data(), length);
+    }
+    size_t length;
+    std::unique_ptr<uint8_t[]> memory;
+};
+
+ip4_wire_header *ip_of(uint8_t *packet) {
+    return reinterpret_cast<ip4_wire_header *>(packet);
+}
+
+// The checksum field of TCP and UDP, when the packet has one.
+be16 *transport_checksum(uint8_t *packet, size_t length) {
+    const size_t header = ip4_header_length(*ip_of(packet));
+    if (to_host(ip_of(packet)->fragment) & IP4_FRAGMENT)
+        return nullptr;
+    if (ip_of(packet)->protocol == PROTOCOL_TCP && length >= header + sizeof(tcp_wire_header))
+        return &reinterpret_cast<tcp_wire_header *>(packet + header)->checksum;
+    if (ip_of(packet)->protocol == PROTOCOL_UDP && length >= header + sizeof(udp_wire_header))
+        return &reinterpret_cast<udp_wire_header *>(packet + header)->checksum;
+    return nullptr;
+}
+
+void mend_packet(uint8_t *packet, size_t length) {
+    if (length < sizeof(ip4_wire_header) || length > IP4_MAX_PACKET)
+        return;
+    const size_t header = ip4_header_length(*ip_of(packet));
+    if (header < sizeof(ip4_wire_header) || header > length)
+        return;
+    ip_of(packet)->total_length = to_be16(static_cast<uint16_t>(length));
+    ip_of(packet)->checksum = {};
+    ip_of(packet)->checksum = checksum_finish(checksum_add(0, packet, header));
+    be16 *const checksum = transport_checksum(packet, length);
+    if (!checksum)
+        return;
+    if (ip_of(packet)->protocol == PROTOCOL_UDP)
+        reinterpret_cast<udp_wire_header *>(packet + header)->length =
+            to_be16(static_cast<uint16_t>(length - header));
+    *checksum = {};
+    *checksum = checksum_finish(
+        checksum_add(checksum_pseudo(*ip_of(packet), length - header), packet + header, length - header));
+}
+
+// Where the carried packet begins, if the GRE header is as most are.
+size_t offset_of_packet(const bytes &gre) {
+    if (gre.size() < 5)
+        return gre.size();
+    size_t at = gre[0] & 0x80 ? 8 : 4;
+    if (gre[2] == 0x88 && at < gre.size() && gre[at] >> 4 != 4)
+        at += 4;
+    return at < gre.size() ? at : gre.size();
+}
+
+void mend_frame(bytes *gre) {
+    const size_t at = offset_of_packet(*gre);
+    mend_packet(gre->data() + at, gre->size() - at);
+    if (gre->size() < 8 || !(gre->at(0) & 0x80))
+        return;
+    gre->at(4) = gre->at(5) = 0;
+    const be16 sum = checksum_finish(checksum_add(0, gre->data(), gre->size()));
+    memcpy(gre->data() + 4, &sum, sizeof sum);
+}
+
+// The next segment of the same flow.
+void advance(bytes *gre) {
+    const size_t at = offset_of_packet(*gre);
+    if (gre->size() - at < sizeof(ip4_wire_header) + sizeof(tcp_wire_header))
+        return;
+    ip4_wire_header *ip = ip_of(gre->data() + at);
+    ip->id = to_be16(static_cast<uint16_t>(to_host(ip->id) + 1));
+    auto *tcp = reinterpret_cast<tcp_wire_header *>(ip + 1);
+    const size_t headers = sizeof *ip + tcp_header_length(*tcp);
+    if (ip->protocol == PROTOCOL_TCP && gre->size() - at > headers)
+        tcp->sequence = to_be32(static_cast<uint32_t>(to_host(tcp->sequence) + gre->size() - at - headers));
+}
+
+// Packets in order, by what keeps its order: a flow, or its addresses where there are no ports.
+using flow_table = std::map<bytes, std::vector<bytes>>;
+void keep_packet(flow_table *table, bytes packet) {
+    ip4_wire_header *ip = ip_of(packet.data());
+    bytes key(packet.begin() + 9, packet.begin() + 10);
+    key.insert(key.end(), packet.begin() + 12, packet.begin() + 20);
+    be16 *const checksum = transport_checksum(packet.data(), packet.size());
+    if (checksum && ip4_header_length(*ip) == sizeof *ip)
+        key.insert(key.end(), packet.begin() + 20, packet.begin() + 24);
+    if (checksum && to_host(*checksum) == 0 && ip->protocol == PROTOCOL_TCP)
+        *checksum = to_be16(0xffff); // the other way to write it
+    if (to_host(ip->fragment) & IP4_DONT_FRAGMENT)
+        ip->id = ip->checksum = {}; // equal ones are numbered anew
+    (*table)[key].push_back(std::move(packet));
+}
+
+flow_table taken, given;
+uint64_t packets_written;
+
+void split_and_keep(const virtio_header &header, const bytes &content) {
+    exact_memory packet(content);
+    packet_split split;
+    REQUIRE(split_begin(&split, header, packet.memory.get(), packet.length));
+    for (split_segment segment; split_next(&split, &segment);) {
+        bytes one(segment.header, segment.header + segment.header_length);
+        one.insert(one.end(), segment.payload, segment.payload + segment.payload_length);
+        keep_packet(&given, std::move(one));
+    }
+}
+
+void take_write(void *, const iovec *parts, size_t count, uint32_t packets) {
+    REQUIRE(count >= 2 && count <= 2 + COALESCED_SEGMENTS && packets >= 1);
+    REQUIRE(parts[0].iov_len == sizeof(virtio_header));
+    virtio_header header;
+    memcpy(&header, parts[0].iov_base, sizeof header);
+    bytes packet;
+    for (size_t i = 1; i < count; i++) {
+        const auto *from = static_cast<const uint8_t *>(parts[i].iov_base);
+        packet.insert(packet.end(), from, from + parts[i].iov_len);
+    }
+    REQUIRE(packet.size() <= IP4_MAX_PACKET && ip4_is_valid(packet.data(), packet.size()));
+    uint32_t segments = 1;
+    if (packets > 1)
+        REQUIRE(large_packet_is_valid(header, packet.data(), packet.size(), &segments));
+    REQUIRE(segments == packets && (header.gso_type != VIRTIO_NOT_LARGE) == (packets > 1));
+    packets_written += packets;
+    split_and_keep(header, packet);
+}
+
+bytes in_outer_packet(const bytes &gre) {
+    bytes out(sizeof(ip4_wire_header));
+    *ip_of(out.data()) = {0x45,
+                          0,
+                          to_be16(static_cast<uint16_t>(out.size() + gre.size())),
+                          {},
+                          {},
+                          64,
+                          PROTOCOL_GRE,
+                          {},
+                          to_be32(0x0a000001),
+                          to_be32(0x0a000002)};
+    ip_of(out.data())->checksum = checksum_finish(checksum_add(0, out.data(), out.size()));
+    out.insert(out.end(), gre.begin(), gre.end());
+    return out;
+}
+
+// True when the packet that the frame carries has gone to the coalescer, from `frame`'s own memory.
+bool take_frame(coalescer *merger, exact_memory *frame) {
+    gre_outer outer;
+    if (read_gre_outer(frame->memory.get(), frame->length, &outer) != REFUSALS)
+        return false;
+    REQUIRE(outer.local == 0x0a000002 && outer.remote == 0x0a000001);
+    gre_content content;
+    if (read_gre_payload(outer.payload, outer.length, &content) != REFUSALS)
+        return false;
+    REQUIRE(ip4_is_valid(content.packet, content.length));
+    keep_packet(&taken, bytes(content.packet, content.packet + content.length));
+    coalesce_packet(merger, nullptr, content.packet, content.length);
+    return true;
+}
+
+void take_frames(uint8_t mode, const uint8_t *data, size_t size) {
+    static coalescer merger;
+    merger.sink = take_write;
+    merger.merge_udp = mode & UDP_MERGED;
+    taken.clear();
+    given.clear();
+    packets_written = 0;
+    std::vector<exact_memory> frames; // stay until the flush
+    bytes gre;
+    uint64_t accepted = 0;
+    while (size >= 2 && frames.size() < MAX_FRAMES) {
+        const size_t head = static_cast<size_t>(data[0]) << 8 | data[1];
+        data += 2;
+        size -= 2;
+        size_t times = 1;
+        if (head & 0x8000) {
+            times = (head & 0x7f) + 1;
+        } else {
+            const size_t length = head < size ? head : size;
+            gre.assign(data, data + length);
+            data += length;
+            size -= length;
+        }
+        for (; times > 0 && frames.size() < MAX_FRAMES; times--) {
+            if (head & 0x8000)
+                advance(&gre);
+            if (mode & MENDED)
+                mend_frame(&gre);
+            frames.emplace_back(in_outer_packet(gre));
+            accepted += take_frame(&merger, &frames.back());
+            if ((mode & FLUSHED) && frames.size() % 5 == 0)
+                coalesce_flush(&merger);
+        }
+    }
+    coalesce_flush(&merger);
+    REQUIRE(merger.used == 0 && packets_written == accepted);
+    REQUIRE(taken == given);
+}
+
+void take_tun_read(uint8_t mode, const uint8_t *data, size_t size) {
+    virtio_header header;
+    if (size < sizeof header)
+        return;
+    memcpy(&header, data, sizeof header);
+    bytes content(data + sizeof header, data + size);
+    if (mode & MENDED)
+        mend_packet(content.data(), content.size());
+    exact_memory packet(content);
+    packet_split split;
+    if (!split_begin(&split, header, packet.memory.get(), packet.length))
+        return;
+    const size_t headers = split.header_length;
+    size_t payload = 0, segments = 0;
+    for (split_segment segment; split_next(&split, &segment); segments++) {
+        payload += segment.payload_length;
+        bytes one(segment.header, segment.header + segment.header_length);
+        REQUIRE(one.size() == headers);
+        one.insert(one.end(), segment.payload, segment.payload + segment.payload_length);
+        REQUIRE(one.size() <= packet.length);
+        if (header.gso_type == VIRTIO_NOT_LARGE)
+            continue;
+        REQUIRE(ip4_is_valid(one.data(), one.size()) && segment.payload_length <= header.segment_size);
+        const size_t ip = ip4_header_length(*ip_of(one.data()));
+        REQUIRE(checksum_is_right(checksum_add(checksum_pseudo(*ip_of(one.data()), one.size() - ip),
+                                               one.data() + ip, one.size() - ip)));
+    }
+    REQUIRE(headers + payload <= packet.length && segments <= packet.length / MIN_SEGMENT_SIZE + 1);
+    REQUIRE(header.gso_type == VIRTIO_NOT_LARGE || headers + payload == packet.length);
+}
+
+} // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
+    if (size == 0)
+        return 0;
+    if (data[0] & TUN_READ)
+        take_tun_read(data[0], data + 1, size - 1);
+    else
+        take_frames(data[0], data + 1, size - 1);
+    return 0;
+}

@@ -1,0 +1,516 @@
+// The user-space data plane: its reader of GRE, merging and splitting, and the whole of it between two
+// network namespaces.
+
+#include <arpa/inet.h>
+#include <gtest/gtest.h>
+#include <net/if.h>
+#include <netinet/tcp.h>
+#include <poll.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <fstream>
+#include <functional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "peers/tunneld/coalesce.h"
+#include "peers/tunneld/gre.h"
+#include "peers/tunneld/plane.h"
+
+namespace {
+
+using bytes = std::vector<uint8_t>;
+
+template <typename Header>
+Header *at(bytes *packet, size_t offset) {
+    return reinterpret_cast<Header *>(packet->data() + offset);
+}
+ip4_wire_header *ip(bytes *packet) {
+    return at<ip4_wire_header>(packet, 0);
+}
+tcp_wire_header *tcp(bytes *packet) {
+    return at<tcp_wire_header>(packet, sizeof(ip4_wire_header));
+}
+
+// Lengths and checksums as they should be, for a header without options.
+void mend(bytes *packet) {
+    ip4_wire_header *header = ip(packet);
+    header->total_length = to_be16(static_cast<uint16_t>(packet->size()));
+    header->checksum = {};
+    header->checksum = checksum_finish(checksum_add(0, header, sizeof *header));
+    const size_t length = packet->size() - sizeof *header;
+    be16 *checksum = nullptr;
+    if (header->protocol == PROTOCOL_TCP) {
+        checksum = &tcp(packet)->checksum;
+    } else if (header->protocol == PROTOCOL_UDP) {
+        auto *udp = at<udp_wire_header>(packet, sizeof *header);
+        udp->length = to_be16(static_cast<uint16_t>(length));
+        checksum = &udp->checksum;
+    }
+    if (!checksum)
+        return;
+    *checksum = {};
+    *checksum = checksum_finish(checksum_add(checksum_pseudo(*header, length), header + 1, length));
+}
+
+// The number of a packet gives its id, its bytes and, by the payload, its place in the stream.
+bytes make_packet(uint8_t protocol, uint32_t number, size_t payload) {
+    const size_t transport = protocol == PROTOCOL_TCP ? 32 : sizeof(udp_wire_header);
+    bytes packet(sizeof(ip4_wire_header) + transport + payload);
+    *ip(&packet) = {0x45,
+                    0,
+                    {},
+                    to_be16(static_cast<uint16_t>(0xfffe + number)),
+                    to_be16(IP4_DONT_FRAGMENT),
+                    60,
+                    protocol,
+                    {},
+                    to_be32(0xc6336401),
+                    to_be32(0xcb007101)};
+    tcp_wire_header *header = tcp(&packet);
+    header->source_port = to_be16(40000);
+    header->destination_port = to_be16(80);
+    if (protocol == PROTOCOL_TCP) {
+        header->sequence = to_be32(0xfffffff0 + number * 100);
+        header->data_offset = 0x80; // with 12 bytes of options
+        header->flags = TCP_ACK;
+        packet[40] = 1;
+    }
+    for (size_t i = packet.size() - payload; i < packet.size(); i++)
+        packet[i] = static_cast<uint8_t>(i * 7 + number);
+    mend(&packet);
+    return packet;
+}
+
+bytes wrap(uint16_t flags, uint16_t type, const bytes &content, const bytes &between = {}) {
+    bytes out(sizeof(gre_wire_header));
+    *at<gre_wire_header>(&out, 0) = {to_be16(flags), to_be16(type)};
+    if (flags & GRE_CHECKSUM)
+        out.resize(out.size() + sizeof(gre_wire_checksum));
+    out.insert(out.end(), between.begin(), between.end());
+    out.insert(out.end(), content.begin(), content.end());
+    if (flags & GRE_CHECKSUM)
+        at<gre_wire_checksum>(&out, 4)->checksum = checksum_finish(checksum_add(0, out.data(), out.size()));
+    return out;
+}
+
+TEST(gre, headers_are_taken_or_refused) {
+    const bytes packet = make_packet(PROTOCOL_UDP, 1, 31), redirect = {0x80, 51, 7, 200};
+    bytes wrong = packet, cut = packet, padded = packet, corrupt = wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
+    wrong[8]++; // TTL, under the header's checksum
+    cut.pop_back();
+    padded.resize(packet.size() + 6);
+    corrupt.back()++;
+    const struct {
+        const char *what;
+        bytes payload;
+        refusal why;
+        bool has_redirect = false;
+    } rows[] = {
+        {"plain", wrap(0, GRE_TYPE_IPV4, packet), REFUSALS},
+        {"padded", wrap(0, GRE_TYPE_IPV4, padded), REFUSALS},
+        {"redirected", wrap(0, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
+        {"redirected without header", wrap(0, GRE_TYPE_REDIRECT, packet), REFUSALS},
+        {"checksum", wrap(GRE_CHECKSUM, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
+        {"reserved bits", wrap(0x03f8, GRE_TYPE_IPV4, packet), REFUSALS},
+        {"wrong checksum", corrupt, REFUSED_CHECKSUM},
+        {"checksum cut", {0x80, 0, 8, 0, 0, 0}, REFUSED_LENGTH},
+        {"routing", wrap(0x4000, GRE_TYPE_IPV4, packet), REFUSED_FLAGS},
+        {"key", wrap(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}), REFUSED_FLAGS},
+        {"sequence", wrap(0x1000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}), REFUSED_FLAGS},
+        {"version 1", wrap(1, GRE_TYPE_IPV4, packet), REFUSED_FLAGS},
+        {"IPv6", wrap(0, 0x86dd, packet), REFUSED_PROTOCOL},
+        {"header cut", {0, 0, 8}, REFUSED_LENGTH},
+        {"redirect header cut", wrap(0, GRE_TYPE_REDIRECT, {}, {0x80, 51, 7}), REFUSED_LENGTH},
+        {"nothing inside", wrap(0, GRE_TYPE_REDIRECT, {}, redirect), REFUSED_LENGTH},
+        {"redirect header under IPv4", wrap(0, GRE_TYPE_IPV4, packet, redirect), REFUSED_INNER},
+        {"inner checksum", wrap(0, GRE_TYPE_IPV4, wrong), REFUSED_INNER},
+        {"inner length", wrap(0, GRE_TYPE_IPV4, cut), REFUSED_INNER},
+    };
+    for (bytes payload; const auto &row : rows) {
+        SCOPED_TRACE(row.what);
+        payload = row.payload;
+        gre_content content;
+        ASSERT_EQ(read_gre_payload(payload.data(), payload.size(), &content), row.why);
+        if (row.why != REFUSALS)
+            continue;
+        EXPECT_EQ(bytes(content.packet, content.packet + content.length), packet);
+        EXPECT_EQ(content.has_redirect, row.has_redirect);
+        EXPECT_TRUE(!row.has_redirect || memcmp(&content.redirect, redirect.data(), redirect.size()) == 0);
+    }
+}
+
+struct one_write {
+    virtio_header header;
+    bytes packet;
+    uint32_t packets;
+};
+std::vector<one_write> writes;
+void keep_write(void *, const iovec *parts, size_t count, uint32_t packets) {
+    one_write write = {*static_cast<const virtio_header *>(parts[0].iov_base), {}, packets};
+    for (size_t i = 1; i < count; i++) {
+        const auto *from = static_cast<const uint8_t *>(parts[i].iov_base);
+        write.packet.insert(write.packet.end(), from, from + parts[i].iov_len);
+    }
+    writes.push_back(write);
+}
+
+// Packets through the coalescer into `writes`.
+void merge(const std::vector<bytes> &packets, bool udp = true) {
+    static coalescer merger;
+    merger.sink = keep_write;
+    merger.merge_udp = udp;
+    writes.clear();
+    for (const bytes &packet : packets)
+        coalesce_packet(&merger, nullptr, packet.data(), packet.size());
+    coalesce_flush(&merger);
+}
+
+// What comes out of splitting all that was written.
+std::vector<bytes> split_writes() {
+    std::vector<bytes> out;
+    for (one_write &write : writes) {
+        packet_split split;
+        EXPECT_TRUE(split_begin(&split, write.header, write.packet.data(), write.packet.size()));
+        for (split_segment segment; split_next(&split, &segment);) {
+            out.emplace_back(segment.header, segment.header + segment.header_length);
+            out.back().insert(out.back().end(), segment.payload, segment.payload + segment.payload_length);
+        }
+    }
+    return out;
+}
+
+TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
+    struct row {
+        const char *what;
+        std::function<void(bytes *second)> change;
+        size_t expected = 2; // writes
+        uint8_t protocol = PROTOCOL_TCP;
+        bool mended = true; // after the change
+    };
+    const auto reset_dont_fragment = [](bytes *p) { ip(p)->fragment = to_be16(0); };
+    const row rows[] = {
+        {"next segment", [](bytes *) {}, 1},
+        {"next segment with PSH", [](bytes *p) { tcp(p)->flags |= TCP_PSH; }, 1},
+        {"shorter", [](bytes *p) { p->resize(p->size() - 50); }, 1},
+        {"same id under DF", [](bytes *p) { ip(p)->id = to_be16(0xfffe); }, 1},
+        {"longer", [](bytes *p) { p->resize(p->size() + 1); }},
+        {"no payload", [](bytes *p) { p->resize(52); }},
+        {"source", [](bytes *p) { ip(p)->source.bytes[3]++; }},
+        {"destination", [](bytes *p) { ip(p)->destination.bytes[3]++; }},
+        {"source port", [](bytes *p) { tcp(p)->source_port.bytes[1]++; }},
+        {"destination port", [](bytes *p) { tcp(p)->destination_port.bytes[1]++; }},
+        {"acknowledgement", [](bytes *p) { tcp(p)->acknowledgement.bytes[3]++; }},
+        {"gap", [](bytes *p) { tcp(p)->sequence.bytes[3]++; }},
+        {"window", [](bytes *p) { tcp(p)->window.bytes[1]++; }},
+        {"id", [](bytes *p) { ip(p)->id.bytes[1]++; }},
+        {"TTL", [](bytes *p) { ip(p)->ttl--; }},
+        {"TOS", [](bytes *p) { ip(p)->tos = 3; }},
+        {"DF", reset_dont_fragment},
+        {"fragment", [](bytes *p) { ip(p)->fragment = to_be16(0x2000); }},
+        {"TCP options", [](bytes *p) { (*p)[51]++; }},
+        {"length of TCP options", [](bytes *p) { tcp(p)->data_offset = 0x70; }},
+        {"FIN", [](bytes *p) { tcp(p)->flags |= TCP_FIN; }},
+        {"ECN echo", [](bytes *p) { tcp(p)->flags |= 0x40; }},
+        {"urgent", [](bytes *p) { tcp(p)->urgent = to_be16(1); }},
+        {"IP options",
+         [](bytes *p) {
+             ip(p)->version_ihl = 0x46;
+             p->insert(p->begin() + 20, 4, 1);
+         }},
+        {"TCP checksum", [](bytes *p) { p->back()++; }, 2, PROTOCOL_TCP, false},
+        {"next datagram", [](bytes *) {}, 1, PROTOCOL_UDP},
+        {"shorter datagram", [](bytes *p) { p->pop_back(); }, 2, PROTOCOL_UDP},
+        {"no UDP checksum", [](bytes *p) { (*p)[26] = (*p)[27] = 0; }, 2, PROTOCOL_UDP, false},
+        {"UDP checksum", [](bytes *p) { p->back()++; }, 2, PROTOCOL_UDP, false},
+    };
+    for (const row &row : rows) {
+        SCOPED_TRACE(row.what);
+        std::vector<bytes> packets = {make_packet(row.protocol, 0, 100), make_packet(row.protocol, 1, 100)};
+        row.change(&packets[1]);
+        if (row.mended)
+            mend(&packets[1]);
+        merge(packets);
+        ASSERT_EQ(writes.size(), row.expected);
+        EXPECT_TRUE(row.expected == 1 || writes[0].packet == packets[1] || writes[1].packet == packets[1]);
+        // The other way round: what the first packet is like counts as well.
+        merge({packets[1], packets[0]});
+        EXPECT_EQ(writes.size(), 2u);
+    }
+    // Without a checksum that is right the first is merged with nothing, and the others go on.
+    std::vector<bytes> three = {make_packet(PROTOCOL_TCP, 0, 100), make_packet(PROTOCOL_TCP, 1, 100),
+                                make_packet(PROTOCOL_TCP, 2, 100)};
+    three[0].back()++;
+    merge(three);
+    ASSERT_EQ(writes.size(), 2u);
+    EXPECT_EQ(writes[0].packet, three[0]);
+    EXPECT_EQ(writes[1].packets, 2u);
+    merge({make_packet(PROTOCOL_UDP, 0, 100), make_packet(PROTOCOL_UDP, 1, 100)}, false);
+    EXPECT_EQ(writes.size(), 2u);
+}
+
+TEST(coalesce, splitting_gives_back_what_was_merged) {
+    for (const uint8_t protocol : {PROTOCOL_TCP, PROTOCOL_UDP}) {
+        std::vector<bytes> packets;
+        for (uint32_t i = 0; i < 150; i++) // past the limit of one large packet, the end of ids and sequences
+            packets.push_back(make_packet(protocol, i, 100));
+        bytes other = make_packet(protocol, 0, 100); // another flow in between
+        ip(&other)->source.bytes[0] = 9;
+        mend(&other);
+        merge(packets);
+        ASSERT_EQ(writes.size(), 3u);
+        EXPECT_EQ(split_writes(), packets);
+        merge({packets[0], other, packets[1], packets[2]});
+        ASSERT_EQ(writes.size(), 2u);
+        EXPECT_EQ(writes[0].packets + writes[1].packets, 4u);
+    }
+    // PSH and a short segment end a packet; CWR and FIN of a large one come out once.
+    std::vector<bytes> packets;
+    for (uint32_t i = 0; i < 5; i++)
+        packets.push_back(make_packet(PROTOCOL_TCP, i, i == 4 ? 30 : 100));
+    tcp(&packets[1])->flags |= TCP_PSH;
+    mend(&packets[1]);
+    merge(packets);
+    ASSERT_EQ(writes.size(), 2u);
+    EXPECT_EQ(split_writes(), packets);
+    tcp(&writes[1].packet)->flags |= TCP_FIN | TCP_CWR;
+    const std::vector<bytes> split = split_writes();
+    const auto flags = [&split](size_t i) { return split[i][33]; };
+    ASSERT_EQ(split.size(), 5u);
+    EXPECT_EQ(std::vector<int>({flags(2), flags(3), flags(4)}),
+              std::vector<int>({TCP_ACK | TCP_CWR, TCP_ACK, TCP_ACK | TCP_FIN}));
+
+    // A partial checksum of a packet that isn't large is completed; one outside of it is refused.
+    bytes packet = make_packet(PROTOCOL_TCP, 1, 11), partial = packet;
+    tcp(&partial)->checksum = checksum_fold(checksum_pseudo(*ip(&partial), partial.size() - 20));
+    writes = {{{VIRTIO_NEEDS_CHECKSUM, 0, 0, 0, 20, 16}, partial, 1}};
+    EXPECT_EQ(split_writes(), std::vector<bytes>({packet}));
+    const virtio_header hostile[] = {
+        {VIRTIO_NEEDS_CHECKSUM, 0, 0, 0, 20, 43},  {VIRTIO_NEEDS_CHECKSUM, 0, 0, 0, 65535, 65535},
+        {VIRTIO_NEEDS_CHECKSUM, 1, 0, 0, 20, 16},  {VIRTIO_NEEDS_CHECKSUM, 1, 0, 100, 20, 6},
+        {VIRTIO_NEEDS_CHECKSUM, 5, 0, 100, 20, 6}, {VIRTIO_NEEDS_CHECKSUM, 3, 0, 100, 20, 16},
+        {0, VIRTIO_LARGE_TCP4, 0, 100, 20, 16},
+    };
+    for (const virtio_header &header : hostile) {
+        packet_split ignored;
+        EXPECT_FALSE(split_begin(&ignored, header, partial.data(), partial.size()));
+    }
+}
+
+// --- live: this process is the appliance, a child in a network namespace of its own the router
+
+constexpr uint32_t APPLIANCE = 0x0a000001, ROUTER = 0x0a000002, STRANGER = 0x0a000003;
+constexpr size_t TRANSFER = 24 << 20;
+
+void shell(const std::string &command) {
+    ASSERT_EQ(system(command.c_str()), 0) << command;
+}
+
+sockaddr_in address_of(uint32_t host_order, uint16_t port = 0) {
+    sockaddr_in out = {};
+    out.sin_family = AF_INET;
+    out.sin_addr.s_addr = htonl(host_order);
+    out.sin_port = htons(port);
+    return out;
+}
+
+void send_gre(uint32_t source, const bytes &payload) {
+    const int fd = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
+    const sockaddr_in from = address_of(source), to = address_of(APPLIANCE);
+    EXPECT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&from), sizeof from), 0);
+    EXPECT_EQ(
+        sendto(fd, payload.data(), payload.size(), 0, reinterpret_cast<const sockaddr *>(&to), sizeof to),
+        static_cast<ssize_t>(payload.size()));
+    close(fd);
+}
+
+// The router's hand-made packets; the packet that comes back. Ends with 0 when it is as it should be.
+int send_by_hand() {
+    const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
+    const bytes packet = make_packet(PROTOCOL_UDP, 1, 1472), redirect = {0x80, 51, 7, 200};
+    send_gre(STRANGER, wrap(0, GRE_TYPE_IPV4, packet));
+    send_gre(ROUTER, wrap(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}));
+    send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, packet, redirect));
+    pollfd waits = {back, POLLIN, 0};
+    uint8_t got[2048];
+    if (poll(&waits, 1, 3000) != 1)
+        return 1;
+    const ssize_t length = recv(back, got, sizeof got, 0);
+    close(back);
+    bytes expected = packet;
+    ip(&expected)->ttl--;
+    mend(&expected);
+    expected = wrap(0, GRE_TYPE_REDIRECT, expected, redirect);
+    return length == static_cast<ssize_t>(20 + expected.size()) &&
+                   memcmp(got + 20, expected.data(), expected.size()) == 0
+               ? 0
+               : 2;
+}
+
+// Gives back what comes, until the other side has no more.
+int echo_once() {
+    const int listener = socket(AF_INET, SOCK_STREAM, 0), on = 1;
+    const sockaddr_in any = address_of(0xc0a80902, 80);
+    setsockopt(listener, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
+    if (bind(listener, reinterpret_cast<const sockaddr *>(&any), sizeof any) != 0 || listen(listener, 1) != 0)
+        return 3;
+    const int peer = accept(listener, nullptr, nullptr);
+    std::vector<char> buffer(1 << 18);
+    for (ssize_t got; (got = recv(peer, buffer.data(), buffer.size(), 0)) > 0;)
+        if (send(peer, buffer.data(), static_cast<size_t>(got), MSG_NOSIGNAL) != got)
+            return 4;
+    close(peer);
+    close(listener);
+    return 0;
+}
+
+int child_main(int commands, int answers) {
+    prctl(PR_SET_PDEATHSIG, SIGKILL);
+    if (unshare(CLONE_NEWNET) != 0)
+        return 1;
+    std::string error;
+    for (char command = 'u';;) {
+        int result = 0;
+        uint32_t index;
+        if (command == 'h')
+            result = send_by_hand();
+        else if (command == 'p')
+            result = !user_plane.open(&error) ||
+                     !user_plane.make_link("wccp0", {1, ROUTER, APPLIANCE, false}, &index, &error) ||
+                     system("ip addr add 192.168.9.2/24 dev wccp0 && ip link set wccp0 up") != 0;
+        else if (command == 'e')
+            result = echo_once();
+        if (result)
+            fprintf(stderr, "router: '%c' gave %d %s\n", command, result, error.c_str());
+        const char answer = result == 0 ? 'y' : 'n';
+        if (write(answers, &answer, 1) != 1 || read(commands, &command, 1) != 1)
+            return 0;
+    }
+}
+
+struct live_plane : testing::Test {
+    pid_t child = -1;
+    int commands[2], answers[2];
+
+    void SetUp() override {
+        ASSERT_EQ(pipe(commands), 0);
+        ASSERT_EQ(pipe(answers), 0);
+        child = fork();
+        if (child == 0) {
+            close(commands[1]);
+            _exit(child_main(commands[0], answers[1]));
+        }
+        close(commands[0]);
+        ASSERT_TRUE(answered());
+        const std::string pid = std::to_string(child), inside = "nsenter -t " + pid + " -n ip ";
+        shell("ip link add va type veth peer name vr netns " + pid);
+        shell("ip addr add 10.0.0.1/24 dev va && ip link set va up");
+        shell(inside + "addr add 10.0.0.2/24 dev vr && " + inside + "addr add 10.0.0.3/24 dev vr && " +
+              inside + "link set vr up");
+    }
+    void TearDown() override {
+        user_plane.close();
+        user_plane_settings = {};
+        std::string error;
+        EXPECT_TRUE(user_plane.drop_link("wccp0", &error)) << error;
+        EXPECT_EQ(if_nametoindex("wccp0"), 0u);
+        close(commands[1]);
+        kill(child, SIGKILL);
+        waitpid(child, nullptr, 0);
+    }
+    void order(char command) { ASSERT_EQ(write(commands[1], &command, 1), 1); }
+    bool answered() {
+        char answer = 0;
+        return read(answers[0], &answer, 1) == 1 && answer == 'y';
+    }
+};
+
+// Sends and takes back; true when all came back as it was.
+bool transfer(uint32_t *out_retransmissions) {
+    const int fd = socket(AF_INET, SOCK_STREAM, 0);
+    const sockaddr_in to = address_of(0xc0a80902, 80);
+    bool connected = false;
+    for (int i = 0; i < 100 && !connected; i++, usleep(20000)) // until the router listens
+        connected = connect(fd, reinterpret_cast<const sockaddr *>(&to), sizeof to) == 0;
+    bytes sent(TRANSFER), back;
+    for (size_t i = 0; i < TRANSFER; i++)
+        sent[i] = static_cast<uint8_t>((i * 2654435761u) >> 13);
+    std::thread sender([&] {
+        for (size_t done = 0; done < TRANSFER;) {
+            const ssize_t result = send(fd, sent.data() + done, TRANSFER - done, MSG_NOSIGNAL);
+            if (result <= 0)
+                break;
+            done += static_cast<size_t>(result);
+        }
+        shutdown(fd, SHUT_WR);
+    });
+    bytes buffer(1 << 18);
+    for (ssize_t got; (got = recv(fd, buffer.data(), buffer.size(), 0)) > 0;)
+        back.insert(back.end(), buffer.begin(), buffer.begin() + got);
+    sender.join();
+    tcp_info info = {};
+    socklen_t length = sizeof info;
+    getsockopt(fd, IPPROTO_TCP, TCP_INFO, &info, &length);
+    *out_retransmissions = info.tcpi_total_retrans;
+    close(fd);
+    return connected && back == sent;
+}
+
+TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
+    std::string error;
+    uint32_t index = 0, again = 0, retransmissions = 0;
+    user_plane_settings.redirect_header = true;
+    ASSERT_TRUE(user_plane.probe(&error)) << error;
+    ASSERT_TRUE(user_plane.open(&error)) << error;
+    const link_wish wish = {1, APPLIANCE, ROUTER, false};
+    ASSERT_TRUE(user_plane.make_link("wccp0", wish, &index, &error)) << error;
+    EXPECT_EQ(index, if_nametoindex("wccp0"));
+    shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && ip route add 203.0.113.0/24 dev "
+          "wccp0");
+    for (const char *path : {"all/rp_filter", "wccp0/rp_filter"})
+        std::ofstream("/proc/sys/net/ipv4/conf/" + std::string(path)) << 0;
+    std::ofstream("/proc/sys/net/ipv4/conf/wccp0/forwarding") << 1;
+    std::ofstream("/proc/sys/net/ipv4/conf/wccp0/send_redirects") << 0;
+
+    // What the router redirects and nobody wants goes back with its redirect header.
+    order('h');
+    EXPECT_TRUE(answered());
+    plane_counters counters;
+    user_plane.read_counters(&counters);
+    EXPECT_EQ(counters.links["wccp0"].packets_in, 1u);
+    EXPECT_EQ(counters.links["wccp0"].bytes_in, 1500u);
+    EXPECT_EQ(counters.links["wccp0"].packets_out, 1u);
+    EXPECT_EQ(counters.links["wccp0"].refused[REFUSED_FLAGS], 1u);
+    EXPECT_EQ(counters.refused[REFUSED_SOURCE], 1u);
+    EXPECT_EQ(counters.refused_sources, (std::map<uint32_t, uint64_t>{{STRANGER, 1}}));
+
+    order('p');
+    ASSERT_TRUE(answered());
+    order('e');
+    EXPECT_TRUE(transfer(&retransmissions));
+    EXPECT_TRUE(answered());
+    user_plane.read_counters(&counters);
+    const link_counters &link = counters.links["wccp0"];
+    EXPECT_GT(link.packets_in, TRANSFER / 1448);
+    EXPECT_GT(link.packets_out, TRANSFER / 1448);
+    printf("%u retransmissions, %lu without room\n", retransmissions, link.refused[REFUSED_ROOM]);
+
+    // The next process takes the interface over.
+    user_plane.close();
+    ASSERT_EQ(if_nametoindex("wccp0"), index);
+    ASSERT_TRUE(user_plane.open(&error)) << error;
+    ASSERT_TRUE(user_plane.make_link("wccp0", wish, &again, &error)) << error;
+    EXPECT_EQ(again, index);
+    order('e');
+    EXPECT_TRUE(transfer(&retransmissions));
+    EXPECT_TRUE(answered());
+}
+
+} // namespace
