@@ -73,7 +73,18 @@ TEST(ConfigFile, EachBadLineIsToldWithItsReason) {
          "F:1: /logging/syslog/process/a /log_level: the part \"a \" of the name begins or ends with a "
          "blank; write "
          "it without"},
+        {"[" NODE_BYPASS_CONFIG "/10.0.0.0]\n", "F:1: \"10.0.0.0\" is no IPv4 prefix such as 10.0.0.0/8"},
+        {"[" NODE_BYPASS_CONFIG "/10.0.0.0\\/08]\n",
+         "F:1: \"10.0.0.0/08\" is no IPv4 prefix such as 10.0.0.0/8"},
+        {"[" NODE_BYPASS_CONFIG "/10.0.0.1\\/8]\n",
+         "F:1: \"10.0.0.1/8\" has host bits that are not zero; write the address of the network, such as "
+         "10.0.0.0/8, or /32 for a host"},
+        {"[" NODE_ACCEPT_CONFIG "/10.0.0]\n", "F:1: \"10.0.0\" is no IPv4 address such as 10.0.0.1"},
+        {"[" NODE_ACCEPT_CONFIG "/224.0.0.1]\n", "F:1: \"224.0.0.1\" is not the address of another host"},
         // What only the whole shows.
+        {"[" NODE_INTERCEPT_CONFIG "/0]\ncheck = http\n",
+         "F:2: " NODE_INTERCEPT_CONFIG
+         "/0/check: http needs the path of a page, without blanks, in check_argument"},
         {"[" + GROUP + "/router/1]\n", "F:1: " + GROUP + "/router/1: has no ipaddr"},
         {section + "router/1/ipaddr = 10.0.0.1\nrouter/3/ipaddr = 10.0.0.3\n",
          "F:3: " + GROUP + "/router: entries are numbered from 1 without a gap, number 2 is missing"},
@@ -87,6 +98,42 @@ TEST(ConfigFile, EachBadLineIsToldWithItsReason) {
     EXPECT_EQ(errors_of(section + "password = 123456789\n").find("123456789"), std::string::npos);
 }
 
+TEST(Schema, ListsAreCheckedAndBroughtIntoOneForm) {
+    std::string crowd;
+    for (int i = 1; i <= 65; i++)
+        crowd += std::to_string(2 * i) + " ";
+    const struct {
+        const char *node;
+        std::string text, kept, refused; // a piece of the reason
+    } cases[] = {
+        {"ports", " 443 80  8080-8090 8085-8100 81", "80-81 443 8080-8100", ""},
+        {"ports", "1 65535 1-65535", "1-65535", ""},
+        {"ports", "all", "all", ""},
+        {"ports", "all 80", "", "is no list of ports"},
+        {"ports", "0", "", "is no list of ports"},
+        {"ports", "80-65536", "", "is no list of ports"},
+        {"ports", "80-", "", "is no list of ports"},
+        {"ports", "81-80", "", "is greater than its last"},
+        {"ports", crowd, "", "more than 64 ranges"},
+        {"ports", crowd + "1-1000", "1-1000", ""},
+        {"bypass", "192.0.2.1 10.0.0.0/8 10.2.0.0/16 9.0.0.0/8 10.0.0.0/8",
+         "9.0.0.0/8 10.0.0.0/8 192.0.2.1/32", ""},
+        {"bypass", "255.255.255.255 10.0.0.0/8 0.0.0.0/0", "0.0.0.0/0", ""},
+        {"bypass", "10.0.0.0/33", "", "is no list of IPv4 prefixes"},
+        {"bypass", "10.0.0.1/31", "", "host bits"},
+        {"check_argument", "usr/bin/true", "", "does not begin with"},
+        {"to", "0", "", "is not between 1 and 65535"},
+    };
+    for (const auto &one : cases) {
+        const node_name name = named(std::string(NODE_INTERCEPT_CONFIG "/51/") + one.node);
+        std::string kept, reason;
+        EXPECT_EQ(check_value(*find_schema_row(name), name, one.text, &kept, &reason), one.refused.empty())
+            << one.text;
+        EXPECT_EQ(one.refused.empty() ? kept : "", one.kept) << one.text;
+        EXPECT_NE(reason.find(one.refused), std::string::npos) << reason;
+    }
+}
+
 TEST(ConfigFile, WhatIsWrittenReadsTheSameWithItsComments) {
     const std::string content = "# of the appliance\n"
                                 "[" +
@@ -97,6 +144,8 @@ TEST(ConfigFile, WhatIsWrittenReadsTheSameWithItsComments) {
                                 "password = \" a\\\"b\\\\\"\n"
                                 "router/10/ipaddr = 10.0.0.10\nrouter/9/ipaddr = 10.0.0.9\n"
                                 "[/qv/wccpd/wccp/policy_grp/config/7]\n"
+                                "[" NODE_BYPASS_CONFIG "/10.0.0.0\\/8]\nuntil = 7\n"
+                                "[" NODE_ACCEPT_CONFIG "/10.0.0.1]\n"
                                 "# of the log\n"
                                 "[/logging/syslog/action/file]\n"
                                 "\\/var\\/log\\/messages/facility/all/min_priority = info\n"

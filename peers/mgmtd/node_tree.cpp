@@ -9,6 +9,7 @@
 // exist is refused, so that a mistyped number makes no new group.
 #include "peers/mgmtd/node_tree.h"
 
+#include <algorithm>
 #include <bit>
 #include <set>
 
@@ -17,6 +18,7 @@
 
 static const node_name service_groups = parsed_name(NODE_GROUP_CONFIG);
 static const node_name policy_groups = parsed_name(NODE_POLICY_CONFIG);
+static const node_name intercepts = parsed_name(NODE_INTERCEPT_CONFIG);
 static const node_name policy_membership = parsed_name(NODE_GROUP_CONFIG "/*/policy_grp");
 
 static bool has_wildcard(const node_name &pattern) {
@@ -111,13 +113,33 @@ static bool check_masks(const node_tree &tree, const node_name &group, std::stri
     return false;
 }
 
+// What a health check needs beside its kind.
+static bool check_health_argument(const node_tree &tree, const node_name &intercept,
+                                  std::string *out_reason) {
+    const std::string *kind = text_at(tree, intercept.below("check"));
+    const std::string *argument = text_at(tree, intercept.below("check_argument"));
+    if (!kind || !argument || *kind == "tcp")
+        return true;
+    const bool http = *kind == "http";
+    if (!argument->empty() && (!http || argument->find(' ') == std::string::npos))
+        return true;
+    *out_reason = intercept.below("check").text() + ": " + *kind + " needs " +
+                  (http ? "the path of a page, without blanks," : "the file of a command") +
+                  " in check_argument";
+    return false;
+}
+
 bool tree_check(const node_tree &tree, std::string *out_reason) {
     node_list roots;
     collect_nodes(tree.nodes, service_groups, {false, false, false}, &roots);
     for (const auto *root : roots)
         if (!check_routers(tree, root->first, out_reason) || !check_masks(tree, root->first, out_reason))
             return false;
-    return true;
+    roots.clear();
+    collect_nodes(tree.nodes, intercepts, {false, false, false}, &roots);
+    return std::all_of(roots.begin(), roots.end(), [&](const auto *root) {
+        return check_health_argument(tree, root->first, out_reason);
+    });
 }
 
 void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk, node_list *out) {

@@ -18,12 +18,14 @@
 #include "mgmt/owners.h"
 #include "mgmt/protocol_names.h"
 #include "peers/nodes/binding_text.h"
+#include "peers/nodes/value_lists.h"
 #include "runtime/logging.h"
 
 static constexpr size_t PART_MAX_BYTES = 255;  // of a name
 static constexpr size_t SHOWN_MAX_BYTES = 400; // of a text in a message
 
-static const char *check_level(const std::string &text) {
+static const char *check_level(std::string *inout) {
+    const std::string &text = *inout;
     int32_t level = 0;
     for (const lc_enum_entry *entry = lc_log_level_table; entry->name; entry++)
         if (text == entry->name)
@@ -31,14 +33,16 @@ static const char *check_level(const std::string &text) {
     return level || text.empty() ? nullptr : "is no log level (emerg to debug)";
 }
 
-static const char *check_facility(const std::string &text) {
+static const char *check_facility(std::string *inout) {
+    const std::string &text = *inout;
     for (const lc_enum_entry *entry = lc_log_facility_table; entry->name; entry++)
         if (text == std::to_string(entry->value))
             return nullptr;
     return "is no log facility (a multiple of 8 up to 184)";
 }
 
-static const char *check_protocol(const std::string &text) {
+static const char *check_protocol(std::string *inout) {
+    const std::string &text = *inout;
     const bool digits = !text.empty() && text.find_first_not_of("0123456789") == std::string::npos;
     if (digits)
         return text.size() > 3 || std::stoi(text) < 1 || std::stoi(text) > 255 ? "is not between 1 and 255"
@@ -49,12 +53,20 @@ static const char *check_protocol(const std::string &text) {
     return number < 0 ? "is no protocol; give a name such as tcp or udp, or a number from 1 to 255" : nullptr;
 }
 
-static const char *check_interface(const std::string &text) {
+static const char *check_interface(std::string *inout) {
+    const std::string &text = *inout;
     return text.find_first_of("/ \t:") == std::string::npos ? nullptr : "is no interface name";
+}
+
+static const char *check_path(std::string *inout) {
+    return inout->empty() || inout->front() == '/' ? nullptr : "does not begin with \"/\"";
 }
 
 #define GROUP NODE_GROUP_CONFIG "/*"
 #define POLICY NODE_POLICY_CONFIG "/*"
+#define INTERCEPT NODE_INTERCEPT_CONFIG "/*"
+#define BYPASS NODE_BYPASS_CONFIG "/*"
+#define ACCEPT NODE_ACCEPT_CONFIG "/*"
 #define MESSAGES NODE_SYSLOG "/action/file/*/facility"
 #define MAIN_MESSAGES NODE_SYSLOG "/action/file/\\/var\\/log\\/messages/facility"
 
@@ -92,6 +104,25 @@ static const std::vector<schema_row> rows = [] {
         {GROUP "/mask_src_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr},
         {GROUP "/mask_dst_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr},
         {GROUP "/compatibility", bn_type_str, "ios", 1, 15, "ios|nexus", nullptr},
+
+        // By service group: which of its redirected packets go to a local proxy.
+        {INTERCEPT, bn_type_uint8, nullptr, 0, 255, nullptr, nullptr, true},
+        {INTERCEPT "/protocol", bn_type_str, "tcp", 1, 15, "tcp|udp", nullptr},
+        {INTERCEPT "/ports", bn_type_str, "", 0, 1023, nullptr, check_ports},
+        {INTERCEPT "/to", bn_type_uint16, nullptr, 1, 65535, nullptr, nullptr},
+        {INTERCEPT "/bypass", bn_type_str, "", 0, 2047, nullptr, check_prefixes},
+        {INTERCEPT "/rest", bn_type_str, "return", 1, 15, "return|forward|drop", nullptr},
+        {INTERCEPT "/down", bn_type_str, "return", 1, 15, "return|drop", nullptr},
+        {INTERCEPT "/check", bn_type_str, "tcp", 1, 15, "tcp|http|command", nullptr},
+        {INTERCEPT "/check_argument", bn_type_str, "", 0, 255, nullptr, check_path},
+        {INTERCEPT "/interval", bn_type_uint32, "5", 1, 3600, nullptr, nullptr},
+        {INTERCEPT "/rise", bn_type_uint32, "2", 1, 100, nullptr, nullptr},
+        {INTERCEPT "/fall", bn_type_uint32, "3", 1, 100, nullptr, nullptr},
+        {INTERCEPT "/leave_after", bn_type_uint32, "30", 0, 86400, nullptr, nullptr},
+        {BYPASS, bn_type_ipv4prefix, nullptr, 0, 0, nullptr, check_prefix, true},
+        {BYPASS "/until", bn_type_uint32, "0", 0, NUMBER_MAX, nullptr, nullptr},
+        {ACCEPT, bn_type_ipv4addr, nullptr, 0, 0, nullptr, check_host_address, true},
+        {ACCEPT "/router", bn_type_ipv4addr, "0.0.0.0", 0, 0, nullptr, check_host_address_or_none},
 
         {NODE_SYSTEM_FACILITY, bn_type_uint32, "136", 0, 184, nullptr, check_facility},
         {NODE_SYSLOG "/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level},
@@ -276,12 +307,34 @@ static std::string range_text(const schema_row &row) {
     return std::to_string(row.min) + " and " + std::to_string(row.max);
 }
 
+// What an instance goes by that is no number; the text goes after it.
+static const struct {
+    uint32_t type;
+    const char *fault;
+} other_instances[] = {
+    {bn_type_ipv4addr, "is no IPv4 address such as 10.0.0.1"},
+    {bn_type_ipv4prefix, "is no IPv4 prefix such as 10.0.0.0/8"},
+};
+
+// The part has to be in its one form already: two names for one node would be two nodes.
 static bool check_instance(const schema_row &row, const std::string &part, std::string *out_reason) {
-    if (is_number(part) && std::to_string(std::stoll(part)) == part && std::stoll(part) >= row.min &&
-        std::stoll(part) <= row.max)
-        return true;
-    *out_reason = "\"" + shown_text(part) + "\" is no number between " + range_text(row);
-    return false;
+    const bool numeric = bn_type_numeric(row.type);
+    std::string kept;
+    *out_reason = "\"" + shown_text(part) + "\" ";
+    if (!canonical_text(row.type, part, &kept) || kept != part ||
+        (numeric && (std::stoll(part) < row.min || std::stoll(part) > row.max))) {
+        std::string fault = "is no number between " + range_text(row);
+        for (const auto &[type, other] : other_instances)
+            if (type == row.type)
+                fault = other;
+        *out_reason += fault;
+        return false;
+    }
+    if (const char *reason = row.check ? row.check(&kept) : nullptr) {
+        *out_reason += reason;
+        return false;
+    }
+    return true;
 }
 
 // What the configuration file could not give back, and what nobody would see.
@@ -319,7 +372,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
         *out_text = name.parts.back();
         if (text.empty() || text == *out_text)
             return true;
-        *out_reason = "the value of this node is its own number";
+        *out_reason = "the value of this node is the last part of its name";
         return false;
     }
     const bool secret = name.parts.back() == "password";
@@ -349,7 +402,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
         *out_reason = shown + " is not between " + range_text(row);
         return false;
     }
-    if (const char *reason = row.check ? row.check(*out_text) : nullptr) {
+    if (const char *reason = row.check ? row.check(out_text) : nullptr) {
         *out_reason = shown + " " + reason;
         return false;
     }

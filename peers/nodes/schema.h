@@ -29,9 +29,10 @@ struct schema_row {
     const char *fallback; // the default, or null: the node is absent then
     int64_t min, max;     // of a number; of the length of a text; of the number that an instance goes by
     const char *words;    // of a text, separated by "|"
-    // Further checks: the reason why the text is refused, or null.
-    const char *(*check)(const std::string &text);
-    // The node is one of many: its value is its own last part, and its children need it.
+    // Further checks: null, and the text is brought into its one form, or the reason why it is refused.
+    const char *(*check)(std::string *inout);
+    // The node is one of many: its value is the last part of its name, which is a number, an address or a
+    // prefix by the row's type. Its children need it.
     bool instance = false;
     bool recreates =
         false; // a running group follows a change of it only when it is deleted and created again
