@@ -34,6 +34,8 @@ struct mgmt_link; // owned by whoever made it
 mgmt_link *mgmt_link_new(lew *loop, session_callbacks callbacks);
 void mgmt_link_free(mgmt_link *link);
 bool mgmt_link_is_open(const mgmt_link *link);
+// wccpd's routers are asked for again shortly: to call when tunnels have come or gone.
+void mgmt_link_ask_routers(mgmt_link *link);
 // Events, dropped while there is no session. After a new session has read the configuration, groups that are
 // out of their routers are reported anew by the caller (`configured` is called then).
 void mgmt_link_group_leaves(mgmt_link *link, uint8_t group, const std::string &reason);

@@ -1,0 +1,548 @@
+// The session with mgmtd, on the program's loop. Nothing here waits: the opening, each request and its answer
+// are steps that the loop comes back for, so that the mailbox is served whatever mgmtd does, stopped or slow.
+// No dispatch is nested, and a callback of the library only notes what came; what follows from it is done by
+// advance(), which the timer calls without any lock held.
+//
+// The configuration is read whole after the session has opened and again after each change of it: it is
+// small, and there is no second way to apply it. wccpd's state has no change event. It is asked for after a
+// change, after a role has changed and whenever the caller says so (tunnels come and go with routers), every
+// few seconds while something of it is missing, and now and then for the rest.
+//
+// What is known stays when the session is lost. A router that wccpd no longer lists is kept for as long as a
+// tunnel of a wccpd that has been started again, since that wccpd asks its routers anew.
+#include "peers/tunneld/session.h"
+
+#include <algorithm>
+#include <memory>
+
+#include <arpa/inet.h>
+#include <ifaddrs.h>
+#include <unistd.h>
+
+#include "mgmt/bnode_proto.h"
+#include "mgmt/gcl.h"
+#include "mgmt/mdc_main.h"
+#include "mgmt/node_paths.h"
+#include "mgmt/owners.h"
+#include "peers/nodes/binding_text.h"
+#include "peers/nodes/provider_path.h"
+#include "peers/nodes/schema.h"
+#include "peers/tunneld/session_config.h"
+#include "runtime/event_fdintrcb.h"
+#include "runtime/logging.h"
+#include "runtime/ttime.h"
+
+namespace {
+constexpr int32_t SERVICE = 2;
+constexpr int64_t RETRY_MS = 1000;        // between attempts to connect
+constexpr int64_t OPENING_STEP_MS = 10;   // between looks at a session that is being opened
+constexpr int64_t OPENING_MAX_MS = 10000; // for the whole opening
+constexpr int64_t ANSWER_MAX_MS = 15000;  // then a request is made again
+constexpr int64_t ROUTERS_SOON_MS = 300;  // after what may have changed them
+constexpr int64_t ROUTERS_MISSING_MS = 5000, ROUTERS_KNOWN_MS = 30000;
+constexpr int64_t ROUTER_KEPT_MS = 60000; // after wccpd listed it last
+constexpr int64_t NEVER = INT64_MAX;
+constexpr size_t REASON_MAX = 256;
+
+struct known_router {
+    group_router router;
+    int64_t seen_ms;
+};
+struct request {
+    uint32_t id = 0; // of the message that is under way, or 0
+    int64_t deadline_ms = 0;
+};
+using known_routers = std::map<std::pair<uint8_t, uint32_t>, known_router>; // by group and router id
+} // namespace
+
+struct mgmt_link {
+    session_callbacks callbacks;
+    fdic_libevent *bridge = nullptr;
+    fdic *interests = nullptr;
+    gcl *instance = nullptr;
+    gcl_session *session = nullptr;
+    loop_event *timer = nullptr;
+    enum { closed, greeting, opening, open } stage = closed;
+    int64_t connect_at_ms = 0, open_by_ms = 0;
+
+    request configuration, groups, routers; // that are under way
+    int64_t read_at_ms = NEVER, ask_routers_at_ms = NEVER;
+    std::vector<event_field> configured, listed, states; // answers, as they came
+    bool has_configured = false, has_listed = false, has_states = false;
+
+    bool announced = false; // `view` has been given to the caller in this session
+    configured_view view;
+    std::map<uint8_t, size_t> expected; // routers, by the groups that are up
+    known_routers known;
+    std::vector<std::string> complaints;
+};
+
+namespace {
+void advance_soon(mgmt_link *link) {
+    LOG_STATUS(loop_event_set_timer(link->timer, 0));
+}
+
+// --- Requests
+
+bool send_request(mgmt_link *link, bn_request_msg *msg, request *out) {
+    if (bn_request_msg_send(link->session, msg) != LC_OK)
+        return false;
+    if (out)
+        *out = {msg->msg_id, lt_monotonic_ms() + ANSWER_MAX_MS};
+    return true;
+}
+
+bool send_walks(mgmt_link *link, const std::vector<std::string> &roots, uint32_t flags, request *out) {
+    owned_request msg;
+    if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK)
+        return false;
+    for (const std::string &root : roots)
+        if (bn_query_request_msg_append_str(msg.pointer, bn_query_iterate, flags, root.c_str(), nullptr) !=
+            LC_OK)
+            return false;
+    return send_request(link, msg.pointer, out);
+}
+
+bool send_interest(mgmt_link *link, const char *event, std::initializer_list<const char *> patterns) {
+    owned_request msg;
+    uint32_t number = 0;
+    if (bn_action_request_msg_create(&msg.pointer, ACTION_ADD_INTEREST) != LC_OK ||
+        bn_action_request_msg_append_new_binding(msg.pointer, 0, "event_name", bn_type_name, event,
+                                                 nullptr) != LC_OK)
+        return false;
+    for (const char *pattern : patterns) {
+        const std::string name = "match/" + std::to_string(++number) + "/pattern";
+        if (bn_action_request_msg_append_new_binding(msg.pointer, 0, name.c_str(), bn_type_str, pattern,
+                                                     nullptr) != LC_OK)
+            return false;
+    }
+    return send_request(link, msg.pointer, nullptr);
+}
+
+void send_event(mgmt_link *link, const char *name, const std::vector<event_field> &fields) {
+    owned_request msg;
+    if (link->stage != mgmt_link::open || bn_event_request_msg_create(&msg.pointer, name) != LC_OK)
+        return;
+    for (const event_field &field : fields) {
+        owned_binding binding(make_binding(field.name, field.value));
+        if (!binding.pointer ||
+            bn_event_request_msg_append_binding_takeover(msg.pointer, 0, &binding.pointer, nullptr) != LC_OK)
+            return;
+    }
+    (void)send_request(link, msg.pointer, nullptr);
+}
+
+void ask_routers_within(mgmt_link *link, int64_t delay_ms) {
+    link->ask_routers_at_ms = std::min(link->ask_routers_at_ms, lt_monotonic_ms() + delay_ms);
+}
+
+// --- What comes. These run inside the library, with its locks held.
+
+// The answer to `waiting`, if that is what it is. A refused one is an answer without nodes.
+bool take_answer(request *waiting, const bn_response_msg *msg, std::vector<event_field> *out,
+                 bool *out_came) {
+    if (waiting->id == 0 || msg->response_to != waiting->id)
+        return false;
+    waiting->id = 0;
+    *out_came = msg->return_code == LC_OK;
+    if (*out_came)
+        *out = fields_of(msg);
+    return true;
+}
+
+lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) {
+    auto *link = static_cast<mgmt_link *>(data);
+    if (take_answer(&link->configuration, msg, &link->configured, &link->has_configured) ||
+        take_answer(&link->groups, msg, &link->listed, &link->has_listed) ||
+        take_answer(&link->routers, msg, &link->states, &link->has_states))
+        advance_soon(link);
+    return LC_OK;
+}
+
+lc_status ignore_response(gcl_session *, bn_response_msg *, void *) {
+    return LC_OK;
+}
+
+lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
+    auto *link = static_cast<mgmt_link *>(data);
+    const std::string name = msg->text ? ts_str(msg->text) : "";
+    if (name == EVENT_CONFIG_CHANGE)
+        link->read_at_ms = lt_monotonic_ms();
+    ask_routers_within(link, ROUTERS_SOON_MS);
+    advance_soon(link);
+    return LC_OK;
+}
+
+// --- State queries
+
+using state_tree = std::map<node_name, const state_node *>; // null for a node that only has others below it
+
+state_tree tree_of(const std::vector<state_node> &nodes) {
+    state_tree out;
+    for (const state_node &node : nodes) {
+        node_name name = parsed_name(node.name);
+        if (name.parts.empty())
+            continue;
+        out[name] = &node;
+        for (name.parts.pop_back(); !name.parts.empty(); name.parts.pop_back())
+            out.try_emplace(name, nullptr);
+    }
+    return out;
+}
+
+lc_status get_state(const char *name, const tstr_array *, void *data, bn_binding_array *out) {
+    const auto *tree = static_cast<const state_tree *>(data);
+    const node_name wanted = parsed_name(name);
+    const auto found = tree->find(wanted);
+    if (found == tree->end())
+        return LC_OK;
+    // One of many is listed by its own last part, as its value.
+    const node_value value = found->second ? node_value{found->second->type, found->second->text}
+                                           : node_value{bn_type_str, wanted.parts.back()};
+    owned_binding binding(make_binding(name, value));
+    CHECK_NULL(binding.pointer);
+    CHECK_STATUS(bn_binding_array_append_takeover(out, &binding.pointer));
+    return LC_OK;
+}
+
+lc_status iterate_state(const char *name, const tstr_array *, void *data, tstr_array *out) {
+    const auto *tree = static_cast<const state_tree *>(data);
+    const node_name above = parsed_name(name);
+    for (auto at = tree->upper_bound(above); at != tree->end() && at->first.is_under(above); ++at)
+        if (at->first.parts.size() == above.parts.size() + 1)
+            CHECK_STATUS(tstr_array_append_str(out, at->first.parts.back().c_str()));
+    return LC_OK;
+}
+
+lc_status take_query(gcl_session *session, bn_request_msg *msg, void *data) {
+    auto *link = static_cast<mgmt_link *>(data);
+    const std::vector<state_node> nodes = link->callbacks.state();
+    state_tree tree = tree_of(nodes);
+    CHECK_STATUS(mdc_dispatch_mon_request(session, msg, get_state, &tree, iterate_state, &tree));
+    return LC_OK;
+}
+
+// --- The session
+
+lc_status take_close(int, uint32_t, void *, void *data) {
+    advance_soon(static_cast<mgmt_link *>(data));
+    return LC_OK;
+}
+
+void drop_session(mgmt_link *link) {
+    if (link->stage == mgmt_link::open)
+        LC_LOG(LC_LOG_NOTICE, "session with mgmtd lost; tunnels and intercepts stay as they are");
+    link->stage = mgmt_link::closed;
+    LOG_STATUS(gcl_session_free(&link->session));
+    link->configuration = link->groups = link->routers = {};
+    link->has_configured = link->has_listed = link->has_states = link->announced = false;
+    link->read_at_ms = link->ask_routers_at_ms = NEVER;
+    link->connect_at_ms = lt_monotonic_ms() + RETRY_MS;
+}
+
+// An attempt each second, for as long as nobody listens, is nothing to log.
+void connect_quietly(mgmt_link *link) {
+    link->connect_at_ms = lt_monotonic_ms() + RETRY_MS;
+    if (access(provider_path().c_str(), W_OK) != 0)
+        return;
+    const int suspended = G_logging_suspended.exchange(1);
+    const bool connected =
+        gcl_session_client_new(link->instance, "tunneld", nullptr, 0, &link->session) == LC_OK &&
+        gcl_session_client_connect_by_provider(link->session, "mgmtd", 0) == LC_OK;
+    if (!connected)
+        (void)gcl_session_free(&link->session);
+    G_logging_suspended = suspended;
+    if (!connected)
+        return;
+    link->stage = mgmt_link::greeting;
+    link->open_by_ms = lt_monotonic_ms() + OPENING_MAX_MS;
+}
+
+// An interest in changes is also what makes mgmtd ask this session for tunneld's state.
+void begin_session(mgmt_link *link) {
+    link->stage = mgmt_link::open;
+    LC_LOG(LC_LOG_NOTICE, "session with mgmtd open");
+    if (!send_interest(link, EVENT_CONFIG_CHANGE, {"/qv/tunneld/**", NODE_WCCPD "/**"}) ||
+        !send_interest(link, EVENT_ROLE_CHANGE, {}))
+        LC_LOG(LC_LOG_WARNING, "changes of the configuration cannot be followed");
+    link->read_at_ms = lt_monotonic_ms();
+    for (auto &[key, known] : link->known) // while nobody could be asked they have not aged
+        known.seen_ms = link->read_at_ms;
+}
+
+void step_opening(mgmt_link *link) {
+    int32_t admin = 0;
+    (void)gcl_session_get_state(link->session, nullptr, &admin);
+    if (link->stage == mgmt_link::greeting && admin == GCL_ADMIN_GREETED) {
+        link->stage = mgmt_link::opening;
+        if (gcl_session_client_open_service(link->session, BN_PROTO, SERVICE, nullptr, 0) != LC_OK)
+            drop_session(link);
+    } else if (link->stage == mgmt_link::opening && admin == GCL_ADMIN_OPEN_ANSWERED) {
+        if (gcl_session_service_is_open(link->session, SERVICE))
+            begin_session(link);
+        else
+            drop_session(link);
+    } else if (lt_monotonic_ms() >= link->open_by_ms) {
+        drop_session(link);
+    }
+}
+
+bool is_connected(const mgmt_link *link) {
+    int32_t state = GCL_SESSION_NONE;
+    return link->session && gcl_session_get_state(link->session, &state, nullptr) == LC_OK &&
+           state == GCL_SESSION_CONNECTED;
+}
+
+// --- What is known
+
+std::map<std::string, uint32_t> find_interface_addresses() {
+    std::map<std::string, uint32_t> out; // the first of each
+    ifaddrs *list = nullptr;
+    if (getifaddrs(&list) != 0)
+        return out;
+    for (const ifaddrs *each = list; each; each = each->ifa_next)
+        if (each->ifa_addr && each->ifa_addr->sa_family == AF_INET)
+            out.try_emplace(each->ifa_name,
+                            ntohl(reinterpret_cast<const sockaddr_in *>(each->ifa_addr)->sin_addr.s_addr));
+    freeifaddrs(list);
+    return out;
+}
+
+void take_configuration(mgmt_link *link, configured_view *next) {
+    std::vector<std::string> complaints;
+    *next = read_configuration(link->configured, &complaints);
+    link->expected = count_configured_routers(link->configured);
+    if (complaints != link->complaints)
+        for (const std::string &line : complaints)
+            LC_LOG(LC_LOG_WARNING, "%s", line.c_str());
+    link->complaints = std::move(complaints);
+    link->configured.clear();
+}
+
+// Methods are negotiated anew when a router answers again; until then the flows go as they went.
+void take_routers(mgmt_link *link) {
+    const int64_t now = lt_monotonic_ms();
+    for (const auto &[group, routers] : read_group_routers(link->states))
+        for (const group_router &router : routers) {
+            known_router &known = link->known[{group, router.id}];
+            const group_router before = known.router;
+            known = {router, now};
+            if (router.forward == travel::unknown)
+                known.router.forward = before.forward;
+            if (router.give_back == travel::unknown)
+                known.router.give_back = before.give_back;
+        }
+    link->states.clear();
+}
+
+void forget_old_routers(mgmt_link *link) {
+    const int64_t now = lt_monotonic_ms();
+    std::erase_if(link->known, [&](const auto &each) {
+        return !link->expected.contains(each.first.first) || now - each.second.seen_ms > ROUTER_KEPT_MS;
+    });
+}
+
+// Whether each group that is up has as many routers as are configured, all with their methods.
+bool knows_all_routers(const mgmt_link *link) {
+    std::map<uint8_t, size_t> good;
+    for (const auto &[key, known] : link->known) {
+        if (known.router.forward == travel::unknown || known.router.give_back == travel::unknown)
+            return false;
+        good[key.first]++;
+    }
+    return std::all_of(link->expected.begin(), link->expected.end(), [&](const auto &each) {
+        const auto found = good.find(each.first);
+        return each.second == 0 || (found != good.end() && found->second >= each.second);
+    });
+}
+
+void add_what_wccpd_says(const mgmt_link *link, configured_view *inout) {
+    const std::map<std::string, uint32_t> addresses = find_interface_addresses();
+    for (auto &[id, group] : inout->groups) {
+        const auto found = addresses.find(group.interface);
+        group.local = found == addresses.end() ? 0 : found->second;
+        group.routers.clear();
+        for (auto at = link->known.lower_bound({id, 0}); at != link->known.end() && at->first.first == id;
+             ++at)
+            group.routers.push_back(at->second.router);
+    }
+}
+
+bool same(const configured_view &a, const configured_view &b) {
+    return a.groups == b.groups && a.intercepts == b.intercepts && a.bypasses == b.bypasses &&
+           a.accepted == b.accepted;
+}
+
+// The groups that wccpd runs are asked for by name: a question about another would be an error in its log.
+void ask_about_groups(mgmt_link *link) {
+    static const node_name root = parsed_name(NODE_GROUP_STATE);
+    std::vector<std::string> walks;
+    for (const event_field &node : link->listed)
+        if (const node_name name = parsed_name(node.name);
+            name.is_under(root) && name.parts.size() == root.parts.size() + 1)
+            walks.push_back(name.below("router").text());
+    link->listed.clear();
+    if (!walks.empty())
+        (void)send_walks(link, walks, bn_qf_subtree, &link->routers);
+}
+
+// Takes in what has come, and gives the caller what has changed.
+void digest(mgmt_link *link) {
+    configured_view next = link->view;
+    const bool configured = link->has_configured;
+    if (configured) {
+        take_configuration(link, &next);
+        ask_routers_within(link, 0);
+    }
+    const bool answered = link->has_listed || link->has_states;
+    if (link->has_listed)
+        ask_about_groups(link);
+    if (link->has_states)
+        take_routers(link);
+    if (answered)
+        forget_old_routers(link);
+    if (link->has_states && !knows_all_routers(link))
+        ask_routers_within(link, ROUTERS_MISSING_MS);
+    link->has_configured = link->has_listed = link->has_states = false;
+    if (!configured && (!answered || !link->announced))
+        return;
+    add_what_wccpd_says(link, &next);
+    if (link->announced && same(next, link->view))
+        return;
+    link->announced = true;
+    link->view = std::move(next);
+    link->callbacks.configured(link->view);
+}
+
+bool may_ask(request *inout, int64_t at_ms, int64_t now) {
+    if (inout->id && now >= inout->deadline_ms)
+        inout->id = 0;
+    return !inout->id && now >= at_ms;
+}
+
+// Requests that are due. One of a kind is under way at a time.
+void ask(mgmt_link *link) {
+    const int64_t now = lt_monotonic_ms();
+    if (may_ask(&link->configuration, link->read_at_ms, now)) {
+        link->read_at_ms = NEVER;
+        if (!send_walks(link,
+                        {NODE_GROUP_CONFIG, NODE_INTERCEPT_CONFIG, NODE_BYPASS_CONFIG, NODE_ACCEPT_CONFIG},
+                        bn_qf_subtree, &link->configuration))
+            link->read_at_ms = now + RETRY_MS;
+    }
+    if (may_ask(&link->routers, now, now) && may_ask(&link->groups, link->ask_routers_at_ms, now)) {
+        (void)send_walks(link, {NODE_GROUP_STATE}, 0, &link->groups);
+        link->ask_routers_at_ms = now + (knows_all_routers(link) ? ROUTERS_KNOWN_MS : ROUTERS_MISSING_MS);
+    }
+}
+
+int64_t next_step_ms(const mgmt_link *link) {
+    const int64_t now = lt_monotonic_ms();
+    if (link->stage != mgmt_link::closed && !is_connected(link))
+        return 0;
+    switch (link->stage) {
+    case mgmt_link::closed:
+        return link->connect_at_ms - now;
+    case mgmt_link::greeting:
+    case mgmt_link::opening:
+        return OPENING_STEP_MS;
+    default:
+        break;
+    }
+    int64_t next = NEVER;
+    for (const request *waiting : {&link->configuration, &link->groups, &link->routers})
+        if (waiting->id)
+            next = std::min(next, waiting->deadline_ms);
+    if (!link->configuration.id)
+        next = std::min(next, link->read_at_ms);
+    if (!link->groups.id && !link->routers.id)
+        next = std::min(next, link->ask_routers_at_ms);
+    return next == NEVER ? ROUTERS_KNOWN_MS : next - now;
+}
+
+void advance(int, short, void *data) {
+    auto *link = static_cast<mgmt_link *>(data);
+    if (link->stage != mgmt_link::closed && !is_connected(link))
+        drop_session(link);
+    if (link->stage == mgmt_link::closed && lt_monotonic_ms() >= link->connect_at_ms)
+        connect_quietly(link);
+    else if (link->stage == mgmt_link::greeting || link->stage == mgmt_link::opening)
+        step_opening(link);
+    if (link->stage == mgmt_link::open) {
+        digest(link);
+        ask(link);
+    }
+    LOG_STATUS(loop_event_set_timer(link->timer, std::max<int64_t>(next_step_ms(link), 0)));
+}
+
+lc_status make_instance(mgmt_link *link, lew *loop) {
+    loop_context *context = nullptr;
+    CHECK_STATUS(lew_get_event_context(loop, &context));
+    CHECK_STATUS(fdic_libevent_init(context, &link->bridge));
+    CHECK_STATUS(fdic_init(&link->interests, fdic_libevent_callback, link->bridge));
+    CHECK_STATUS(fdic_libevent_set_fd_close_handler(link->bridge, take_close, link));
+    CHECK_STATUS(gcl_init(&link->instance, nullptr, link->interests));
+    CHECK_STATUS(bn_set_global_callback_query_response_msg(link->instance, take_response, link));
+    CHECK_STATUS(bn_set_global_callback_action_response_msg(link->instance, ignore_response, link));
+    CHECK_STATUS(bn_set_global_callback_event_response_msg(link->instance, ignore_response, link));
+    CHECK_STATUS(bn_set_global_callback_event_request_msg(link->instance, take_event, link));
+    CHECK_STATUS(bn_set_global_callback_query_request_msg(link->instance, take_query, link));
+    CHECK_STATUS(loop_event_new(context, advance, link, &link->timer));
+    CHECK_STATUS(loop_event_set_timer(link->timer, 0));
+    return LC_OK;
+}
+} // namespace
+
+mgmt_link *mgmt_link_new(lew *loop, session_callbacks callbacks) {
+    auto *link = new mgmt_link;
+    link->callbacks = std::move(callbacks);
+    if (make_instance(link, loop) == LC_OK)
+        return link;
+    mgmt_link_free(link);
+    return nullptr;
+}
+
+void mgmt_link_free(mgmt_link *link) {
+    if (!link)
+        return;
+    if (link->bridge) // what is closed from here on calls nobody
+        LOG_STATUS(fdic_libevent_set_fd_close_handler(link->bridge, nullptr, nullptr));
+    LOG_STATUS(gcl_deinit(&link->instance));
+    LOG_STATUS(fdic_libevent_deinit(&link->bridge));
+    LOG_STATUS(fdic_deinit(&link->interests));
+    loop_event_free(&link->timer);
+    delete link;
+}
+
+bool mgmt_link_is_open(const mgmt_link *link) {
+    return link->stage == mgmt_link::open && is_connected(link);
+}
+
+void mgmt_link_ask_routers(mgmt_link *link) {
+    if (link->stage != mgmt_link::open)
+        return;
+    ask_routers_within(link, ROUTERS_SOON_MS);
+    advance_soon(link);
+}
+
+// --- Events
+
+static event_field group_field(uint8_t group) {
+    return {"group", {bn_type_uint8, std::to_string(group)}};
+}
+static event_field reason_field(const std::string &reason) {
+    return {"reason", {bn_type_str, shown_text(reason.substr(0, REASON_MAX))}};
+}
+
+void mgmt_link_group_leaves(mgmt_link *link, uint8_t group, const std::string &reason) {
+    send_event(link, EVENT_GROUP_LEAVE, {group_field(group), reason_field(reason)});
+}
+
+void mgmt_link_group_joins(mgmt_link *link, uint8_t group) {
+    send_event(link, EVENT_GROUP_JOIN, {group_field(group)});
+}
+
+void mgmt_link_proxy_changed(mgmt_link *link, uint8_t group, bool up, const std::string &reason) {
+    send_event(link, EVENT_PROXY_CHANGE,
+               {group_field(group), {"up", {bn_type_bool, up ? "true" : "false"}}, reason_field(reason)});
+}
