@@ -17,6 +17,7 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <netinet/in.h>
+#include <poll.h>
 #include <spawn.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
@@ -31,6 +32,7 @@ extern "C" {
 
 namespace {
 constexpr int64_t CHECK_MAX_MS = 10000;
+constexpr int KILL_MAX_MS = 1000;
 constexpr int64_t STAGGER_MS = 2;         // between the first checks of many new ones
 constexpr size_t ANSWER_MAX_BYTES = 4096; // of which the first line counts
 constexpr size_t LINGERING_MAX = 64;      // killed commands that have not ended
@@ -247,9 +249,13 @@ int spawn_command(const std::string &file, pid_t *out_pid) {
     return error;
 }
 
-void kill_and_wait(pid_t pid) {
+// One that doesn't end even so is left to whoever takes in orphans.
+void kill_at_once(pid_t pid, int pidfd) {
     kill(-pid, SIGKILL);
-    (void)waitpid(pid, nullptr, 0);
+    pollfd end = {pidfd, POLLIN, 0};
+    (void)poll(&end, 1, KILL_MAX_MS);
+    (void)waitpid(pid, nullptr, WNOHANG);
+    close(pidfd);
 }
 
 std::string begin_command(watched *self) {
@@ -266,9 +272,7 @@ std::string begin_command(watched *self) {
     if (command.pidfd < 0 || loop_event_new(monitor->loop, take_end, &command, &command.end) != LC_OK ||
         loop_event_set_fd(command.end, command.pidfd, LOOP_READ) != LC_OK) {
         loop_event_free(&command.end);
-        if (command.pidfd >= 0)
-            close(command.pidfd);
-        kill_and_wait(pid);
+        kill_at_once(pid, command.pidfd);
         monitor->commands.pop_back();
         return "no room for a check";
     }
@@ -363,8 +367,7 @@ void health_free(health_monitor *monitor) {
         end_watching(check.get());
     for (running_command &command : monitor->commands) {
         loop_event_free(&command.end);
-        close(command.pidfd);
-        kill_and_wait(command.pid);
+        kill_at_once(command.pid, command.pidfd);
     }
     delete monitor;
 }

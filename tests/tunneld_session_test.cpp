@@ -1,0 +1,461 @@
+// tunneld's session with mgmtd and its health checks, with real sockets: mgmtd's server runs on the same
+// loop.
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "mgmt/bnode_proto.h"
+#include "mgmt/node_paths.h"
+#include "peers/mgmtd/transport.h"
+#include "peers/tunneld/health.h"
+#include "peers/tunneld/session.h"
+#include "peers/tunneld/session_config.h"
+#include "runtime/ttime.h"
+
+using strings = std::vector<std::string>;
+
+// --- Configuration as text
+
+static event_field field(const std::string &name, const std::string &text) {
+    return {name, {bn_type_str, text}};
+}
+
+TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
+    const std::string one = NODE_INTERCEPT_CONFIG "/51", two = NODE_INTERCEPT_CONFIG "/7";
+    std::vector<event_field> nodes = {
+        field(NODE_GROUP_CONFIG "/51/interface", "eth0"),
+        field(NODE_GROUP_CONFIG "/51/policy_grp", "70000"),
+        field(NODE_GROUP_CONFIG "/51/force_l2_return", "true"),
+        field(NODE_GROUP_CONFIG "/52/interface", "../../eth0"),
+        field(NODE_GROUP_CONFIG "/256/interface", "eth0"),
+        field(one + "/protocol", "udp"),
+        field(one + "/ports", "53 8000-8080"),
+        field(one + "/to", "3128"),
+        field(one + "/bypass", "10.1.2.3/8 10.0.0.300 192.0.2.1"),
+        field(one + "/check", "http"),
+        field(one + "/check_argument", "/health"),
+        field(one + "/interval", "0"),
+        field(one + "/down", "drop"),
+        field(two + "/protocol", "tcp"),
+        field(two + "/ports", "all"), // and no port of a proxy
+        field(NODE_BYPASS_CONFIG "/10.0.0.0\\/8", "10.0.0.0/8"),
+        field(NODE_BYPASS_CONFIG "/10.0.0.0\\/8/until", "99"),
+        field(NODE_BYPASS_CONFIG "/10.0.0.0\\/33", "10.0.0.0/33"),
+        field(NODE_ACCEPT_CONFIG "/192.0.2.9", "192.0.2.9"),
+        field(NODE_ACCEPT_CONFIG "/192.0.2.9/router", "192.0.2.1"),
+        field(NODE_ACCEPT_CONFIG "/somewhere", "somewhere"),
+    };
+    strings complaints;
+    configured_view view = read_configuration(nodes, &complaints);
+    EXPECT_EQ(complaints.size(), 7u) << testing::PrintToString(complaints);
+    ASSERT_EQ(view.intercepts.size(), 1u);
+    const intercept &rules = view.intercepts[51];
+    EXPECT_EQ(rules.protocol, 17);
+    EXPECT_EQ(rules.ports, (std::vector<port_range>{{53, 53}, {8000, 8080}}));
+    EXPECT_EQ(rules.bypass, (std::vector<ip_prefix>{{0x0a000000, 8}, {0xc0000201, 32}}));
+    EXPECT_TRUE(rules.drop_when_down && rules.check.kind == check_kind::http);
+    EXPECT_EQ(rules.check.interval_s, 5u);
+    EXPECT_EQ(view.bypasses, (std::vector<bypass_entry>{{{0x0a000000, 8}, 99}}));
+    EXPECT_EQ(view.accepted, (std::vector<accepted_source>{{0xc0000209, 0xc0000201}}));
+    EXPECT_EQ(view.groups.size(), 2u);
+    EXPECT_EQ(view.groups[51], (group_view{"eth0", 0, 0, true, {}}));
+    EXPECT_EQ(view.groups[52].interface, "");
+
+    // What a default would turn into "everything" costs the whole intercept.
+    for (const char *ports : {"", "80 0", "8080-8000", "65536", "80;443", "-80"}) {
+        nodes[6].value.text = ports;
+        EXPECT_FALSE(read_configuration(nodes, &complaints).intercepts.contains(51)) << ports;
+    }
+    for (uint32_t i = 0; i < BYPASSES_MAX + 9; i++)
+        nodes.push_back(field(NODE_BYPASS_CONFIG "/10.1." + std::to_string(i / 256) + "." +
+                                  std::to_string(i % 256) + "\\/32",
+                              ""));
+    EXPECT_EQ(read_configuration(nodes, &complaints).bypasses.size(), BYPASSES_MAX);
+    EXPECT_EQ(complaints.size(), COMPLAINTS_MAX);
+}
+
+// --- A loop with a ticker, so that it comes round
+
+namespace {
+struct Loop : testing::Test {
+    lew *wrapper = nullptr;
+    loop_context *loop = nullptr;
+    loop_event *ticker = nullptr;
+    std::function<void()> on_tick;
+
+    void SetUp() override {
+        ASSERT_EQ(lew_init(&wrapper), LC_OK);
+        ASSERT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
+        ASSERT_EQ(loop_event_new(loop, tick, this, &ticker), LC_OK);
+        ASSERT_EQ(loop_event_set_timer(ticker, 2), LC_OK);
+    }
+    void TearDown() override {
+        loop_event_free(&ticker);
+        EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
+    }
+    static void tick(int, short, void *data) {
+        auto *self = static_cast<Loop *>(data);
+        if (self->on_tick)
+            self->on_tick();
+        (void)loop_event_set_timer(self->ticker, 2);
+    }
+    bool wait_until(const std::function<bool()> &done, int64_t limit_ms = 5000) const {
+        const int64_t end = lt_monotonic_ms() + limit_ms;
+        while (!done() && lt_monotonic_ms() < end)
+            (void)lew_dispatch_once(wrapper, nullptr, nullptr);
+        return done();
+    }
+};
+
+// --- The session
+
+// mgmtd on the loop, and a wccpd that answers for one router of group 51.
+struct Session : Loop {
+    static constexpr uint32_t WCCPD = 0x10000;
+    std::unique_ptr<server> daemon;
+    std::unique_ptr<transport> sockets;
+    std::vector<bn_request_msg *> asked; // of wccpd
+    std::string said, method = "not-set";
+    mgmt_link *link = nullptr;
+    configured_view view;
+    int readings = 0;
+    std::vector<state_node> states = {{NODE_PLANE_STATE "/name", bn_type_str, "table"},
+                                      {NODE_TUNNEL_STATE "/3/index", bn_type_uint32, "7"},
+                                      {NODE_TUNNEL_STATE "/12/index", bn_type_uint32, "8"}};
+
+    void SetUp() override {
+        Loop::SetUp();
+        on_tick = [this] {
+            std::vector<pollfd> none;
+            if (sockets)
+                transport_round(sockets.get(), &none, 0);
+            answer_for_wccpd();
+        };
+        session_callbacks callbacks;
+        callbacks.configured = [this](const configured_view &now) {
+            view = now;
+            readings++;
+        };
+        callbacks.state = [this] { return states; };
+        link = mgmt_link_new(wrapper, callbacks);
+        ASSERT_TRUE(link);
+    }
+    void TearDown() override {
+        mgmt_link_free(link);
+        stop_mgmtd();
+        Loop::TearDown();
+    }
+    void start_mgmtd() {
+        daemon = std::make_unique<server>();
+        sockets = std::make_unique<transport>();
+        daemon->now_ms = lt_monotonic_ms;
+        daemon->say = [this](const std::string &line) { said += line + "\n"; };
+        daemon->local_addresses = [] { return std::vector<local_address>{}; };
+        tree_refresh(&daemon->tree);
+        std::string error;
+        ASSERT_TRUE(transport_listen(sockets.get(), daemon.get(), &error)) << error;
+        const auto send = daemon->send;
+        daemon->send = [this, send](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
+            if (peer_id < WCCPD) {
+                send(peer_id, mtype, frame);
+                return;
+            }
+            const owned_tbuffer buffer(frame);
+            bn_request_msg *msg = nullptr;
+            if (mtype == bn_msg_query_request && bn_request_msg_deserialize(frame, 32, &msg) == LC_OK)
+                asked.push_back(msg);
+        };
+        server_peer_opened(daemon.get(), WCCPD, "wccpd-1");
+        daemon->peers[WCCPD].interests.push_back({EVENT_CONFIG_CHANGE, {}});
+    }
+    void stop_mgmtd() {
+        if (sockets)
+            transport_close(sockets.get());
+        sockets.reset();
+        daemon.reset();
+        for (bn_request_msg *msg : asked)
+            (void)bn_request_msg_free(&msg);
+        asked.clear();
+    }
+    void answer_for_wccpd() {
+        const std::string group = NODE_GROUP_STATE "/51", router = group + "/router/1";
+        while (!asked.empty()) {
+            const owned_request msg(asked.front());
+            asked.erase(asked.begin());
+            owned_response response;
+            owned_tbuffer frame;
+            ASSERT_EQ(bn_query_response_msg_create(&response.pointer, msg.pointer->msg_id, 0, nullptr),
+                      LC_OK);
+            const auto add = [&](uint32_t id, const std::string &name, const std::string &text) {
+                owned_binding binding(make_binding(name, {bn_type_str, text}));
+                (void)bn_query_response_msg_append_binding_takeover(response.pointer, &binding.pointer, id);
+            };
+            for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(msg.pointer->nodes); i++) {
+                const bn_request_node *node = bn_request_per_node_array_get_quick(msg.pointer->nodes, i);
+                if (name_of(node->binding) == NODE_GROUP_STATE)
+                    add(node->node_id, group, "51");
+                if (name_of(node->binding) == group + "/router") {
+                    add(node->node_id, router + "/id", "192.0.2.1");
+                    add(node->node_id, router + "/ipaddr", "192.0.2.2");
+                    add(node->node_id, router + "/fwd_method", method == "L2" ? "GRE" : method);
+                    add(node->node_id, router + "/ret_method", method);
+                }
+            }
+            response.pointer->service_id = 2;
+            ASSERT_EQ(bn_response_msg_serialize(response.pointer, 32, &frame.pointer), LC_OK);
+            EXPECT_TRUE(server_take_frame(daemon.get(), WCCPD, bn_msg_query_response, frame.pointer));
+        }
+    }
+    void set(const std::string &name, const std::string &text) {
+        const commit_result result =
+            server_commit(daemon.get(), {{set_kind::create, name, bn_type_str, text}}, "test");
+        EXPECT_EQ(result.code, 0u) << result.message;
+    }
+};
+} // namespace
+
+TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
+    EXPECT_FALSE(wait_until([&] { return mgmt_link_is_open(link); }, 50));
+    start_mgmtd();
+    ASSERT_TRUE(wait_until([&] { return readings == 1; })) << said;
+    EXPECT_TRUE(view.groups.empty());
+    set(NODE_GROUP_CONFIG "/51/interface", "lo");
+    set(NODE_GROUP_CONFIG "/51/router/1/ipaddr", "192.0.2.2");
+    set(NODE_INTERCEPT_CONFIG "/51/ports", "80");
+    set(NODE_INTERCEPT_CONFIG "/51/to", "3128");
+    ASSERT_TRUE(wait_until([&] {
+        return view.intercepts.size() == 1 && view.groups[51].routers.size() == 1;
+    })) << said;
+    EXPECT_EQ(view.intercepts[51].to, 3128);
+    EXPECT_EQ(view.groups[51].local, INADDR_LOOPBACK);
+    EXPECT_EQ(view.groups[51].routers[0], (group_router{0xc0000201, 0xc0000202}));
+
+    // A change that is none is not passed on; methods that have been negotiated are, and stay.
+    method = "L2";
+    int before = readings;
+    mgmt_link_ask_routers(link);
+    ASSERT_TRUE(wait_until([&] { return readings > before; }));
+    const group_router known = {0xc0000201, 0xc0000202, travel::gre, travel::l2};
+    EXPECT_EQ(view.groups[51].routers[0], known);
+    method = "not-set";
+    before = readings;
+    mgmt_link_ask_routers(link);
+    EXPECT_FALSE(wait_until([&] { return readings > before; }, 600));
+
+    // mgmtd goes: all stays, and the next one is found without help.
+    stop_mgmtd();
+    ASSERT_TRUE(wait_until([&] { return !mgmt_link_is_open(link); }));
+    mgmt_link_group_leaves(link, 51, "nobody hears it");
+    EXPECT_EQ(readings, before);
+    start_mgmtd();
+    set(NODE_GROUP_CONFIG "/51/interface", "lo");
+    ASSERT_TRUE(wait_until([&] { return readings > before; })) << "given anew, for it may have to report";
+    EXPECT_TRUE(view.intercepts.empty());
+    EXPECT_EQ(view.groups[51].routers, std::vector<group_router>{known});
+}
+
+TEST_F(Session, AnswersForItsStateAndReports) {
+    start_mgmtd();
+    ASSERT_TRUE(wait_until([&] { return readings == 1; })) << said;
+    // A further session on mgmtd's side, whose answers are read from the frames.
+    std::vector<std::string> found;
+    server_peer_opened(daemon.get(), WCCPD + 1, "mgmtctl-2");
+    const auto send = daemon->send;
+    daemon->send = [&, send](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
+        if (peer_id != WCCPD + 1) {
+            send(peer_id, mtype, frame);
+            return;
+        }
+        const owned_tbuffer buffer(frame);
+        owned_response response;
+        ASSERT_EQ(bn_response_msg_deserialize(frame, 32, &response.pointer), LC_OK);
+        for (const event_field &each : fields_of(response.pointer))
+            found.push_back(each.name + "=" + each.value.text);
+        found.push_back("code " + std::to_string(response.pointer->return_code));
+    };
+    const auto ask = [&](const std::string &name, uint32_t subop, uint32_t flags) {
+        owned_request msg;
+        found.clear();
+        (void)bn_query_request_msg_create(&msg.pointer, 0, nullptr);
+        (void)bn_query_request_msg_append_str(msg.pointer, subop, flags, name.c_str(), nullptr);
+        server_answer_query(daemon.get(), WCCPD + 1, msg.pointer);
+        EXPECT_TRUE(wait_until([&] { return !found.empty(); })) << name;
+        return found;
+    };
+    EXPECT_EQ(ask(NODE_TUNNEL_STATE "/12/index", bn_query_get, 0),
+              (strings{NODE_TUNNEL_STATE "/12/index=8", "code 0"}));
+    EXPECT_EQ(ask(NODE_TUNNEL_STATE, bn_query_iterate, 0),
+              (strings{NODE_TUNNEL_STATE "/3=3", NODE_TUNNEL_STATE "/12=12", "code 0"}));
+    EXPECT_EQ(ask(NODE_TUNNEL_STATE, bn_query_iterate, bn_qf_subtree | bn_qf_leaves_only),
+              (strings{NODE_TUNNEL_STATE "/3/index=7", NODE_TUNNEL_STATE "/12/index=8", "code 0"}));
+    EXPECT_EQ(ask(NODE_TUNNEL_STATE "/4/index", bn_query_get, 0), strings{"code 0"});
+
+    // Above both daemons: each is asked, one after the other.
+    const strings all = ask("/qv", bn_query_iterate, bn_qf_subtree | bn_qf_leaves_only);
+    EXPECT_EQ(std::count(all.begin(), all.end(), NODE_PLANE_STATE "/name=table"), 1);
+    EXPECT_EQ(std::count(all.begin(), all.end(), NODE_TUNNEL_STATE "/3/index=7"), 1);
+}
+
+// --- Health
+
+namespace {
+// A server that is told what it does with each connection.
+struct proxy {
+    int listener;
+    uint16_t port = 0;
+    std::string answer; // "": none
+    std::vector<int> clients;
+    std::string heard;
+    int resets = 0;
+
+    proxy() : listener(socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0)) {
+        sockaddr_in address{};
+        socklen_t length = sizeof address;
+        address.sin_family = AF_INET;
+        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        EXPECT_EQ(bind(listener, reinterpret_cast<sockaddr *>(&address), length), 0);
+        EXPECT_EQ(listen(listener, 300), 0);
+        EXPECT_EQ(getsockname(listener, reinterpret_cast<sockaddr *>(&address), &length), 0);
+        port = ntohs(address.sin_port);
+    }
+    ~proxy() {
+        end();
+        close(listener);
+    }
+    proxy(const proxy &) = delete;
+    proxy &operator=(const proxy &) = delete;
+    void end() {
+        for (const int fd : clients)
+            close(fd);
+        clients.clear();
+    }
+    void serve() {
+        for (int fd; (fd = accept4(listener, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC)) >= 0;)
+            clients.push_back(fd);
+        char bytes[4096];
+        for (const int fd : clients) {
+            const ssize_t count = recv(fd, bytes, sizeof bytes, 0);
+            resets += count < 0 && errno == ECONNRESET;
+            if (count <= 0)
+                continue;
+            heard.assign(bytes, static_cast<size_t>(count));
+            if (!answer.empty())
+                (void)send(fd, answer.data(), answer.size(), MSG_NOSIGNAL);
+        }
+    }
+};
+
+struct Health : Loop {
+    proxy server;
+    health_monitor *monitor = nullptr;
+    std::vector<uint8_t> changed;
+    char directory[32] = "/tmp/health-test-XXXXXX";
+
+    void SetUp() override {
+        Loop::SetUp();
+        ASSERT_TRUE(mkdtemp(directory));
+        on_tick = [this] { server.serve(); };
+        monitor = health_new(loop, [this](uint8_t group) { changed.push_back(group); });
+    }
+    void TearDown() override {
+        health_free(monitor);
+        std::filesystem::remove_all(directory);
+        Loop::TearDown();
+    }
+    const proxy_health &state(uint8_t group) const { return health_states(monitor).at(group); }
+    void watch(const health_check &check, uint16_t port) const {
+        intercept rules;
+        rules.to = port;
+        rules.check = check;
+        health_set_checks(monitor, {{51, rules}});
+    }
+    std::string path(const char *name) const { return std::string(directory) + "/" + name; }
+    std::string script(const std::string &content) const {
+        std::ofstream(path("check")) << "#!/bin/sh\n" << content << "\n";
+        chmod(path("check").c_str(), 0755);
+        return path("check");
+    }
+    // The state after the first result of a check that has just been set.
+    std::string first_result(const health_check &check, uint16_t port) const {
+        health_set_checks(monitor, {});
+        watch(check, port);
+        EXPECT_TRUE(wait_until([&] { return state(51).checks == 1; })) << check.argument;
+        return state(51).state == proxy_health::up ? "up" : state(51).reason;
+    }
+};
+} // namespace
+
+TEST_F(Health, TheFirstResultSettlesAndLaterOnesHaveToAgree) {
+    watch({check_kind::tcp, "", 1, 2, 2}, server.port);
+    EXPECT_EQ(state(51).state, proxy_health::unknown);
+    ASSERT_TRUE(wait_until([&] { return changed.size() == 1; }, 500)) << "at once";
+    EXPECT_EQ(state(51).state, proxy_health::up);
+    EXPECT_TRUE(wait_until([&] { return server.resets == 1; })) << "reset, not closed";
+    watch({check_kind::tcp, "", 1, 2, 2}, server.port);
+    EXPECT_EQ(state(51).checks, 1u) << "the same check goes on";
+
+    close(server.listener);
+    ASSERT_TRUE(wait_until([&] { return state(51).failures == 1; }));
+    EXPECT_EQ(state(51).state, proxy_health::up);
+    ASSERT_TRUE(wait_until([&] { return changed.size() == 2; }));
+    EXPECT_EQ(state(51).state, proxy_health::down);
+    EXPECT_EQ(state(51).failures, 2u);
+    EXPECT_EQ(state(51).reason, "connection refused");
+    health_set_checks(monitor, {});
+    EXPECT_TRUE(health_states(monitor).empty());
+}
+
+TEST_F(Health, EachKindOfCheckHasItsReasons) {
+    const health_check http = {check_kind::http, "/ok", 1, 1, 1};
+    const struct {
+        const char *answer, *result;
+    } answers[] = {
+        {"HTTP/1.1 204 No Content\r\n\r\n", "up"},
+        {"HTTP/1.0 399 x\r\n", "up"},
+        {"HTTP/1.1 503 Service Unavailable\r\n\r\n", "status 503"},
+        {"SSH-2.0-x\r\n", "no HTTP answer"},
+        {"", "no answer in 1000 ms"},
+    };
+    for (const auto &[answer, result] : answers) {
+        server.answer = answer;
+        EXPECT_EQ(first_result(http, server.port), result) << answer;
+        server.end();
+    }
+    EXPECT_TRUE(server.heard.starts_with("GET /ok HTTP/1.0\r\nHost: 127.0.0.1:")) << server.heard;
+    server.answer = std::string(1 << 20, 'x');
+    EXPECT_EQ(first_result(http, server.port), "no HTTP answer");
+
+    setenv("SECRET", "1", 1);
+    EXPECT_EQ(
+        first_result(
+            {check_kind::command, script("test -z \"$SECRET\" && test ! -e /proc/self/fd/4"), 1, 1, 1}, 1),
+        "up");
+    EXPECT_EQ(first_result({check_kind::command, script("exit 3"), 1, 1, 1}, 1), "exit status 3");
+    EXPECT_EQ(first_result({check_kind::command, script("kill -9 $$"), 1, 1, 1}, 1), "ended by SIGKILL");
+    EXPECT_EQ(first_result({check_kind::command, path("none"), 1, 1, 1}, 1),
+              path("none") + ": No such file or directory");
+    // Killed with all that it has started, at its end and when its time is over.
+    for (const auto &[content, result] : {std::pair{"sleep 100 & echo $! >PID", "up"},
+                                          {"sleep 100 & echo $! >PID; wait", "no answer in 1000 ms"}}) {
+        std::string text = content;
+        text.replace(text.find("PID"), 3, path("pid"));
+        EXPECT_EQ(first_result({check_kind::command, script(text), 1, 1, 1}, 1), result);
+        std::ifstream file(path("pid"));
+        pid_t pid = 0;
+        file >> pid;
+        ASSERT_GT(pid, 0);
+        const auto gone = [&] {
+            std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
+            std::string number, name, letter;
+            return !(stat >> number >> name >> letter) || letter == "Z";
+        };
+        EXPECT_TRUE(wait_until(gone)) << pid;
+    }
+}
