@@ -34,6 +34,7 @@
 #define NODE_ALARM_STATE "/qv/alarms/state"
 #define NODE_ALARMS_RAISED NODE_ALARM_STATE "/raised" // by type and source
 #define NODE_ROLES NODE_ALARM_STATE "/role"           // by group
+#define NODE_LEFT_GROUPS NODE_ALARM_STATE "/left"     // out of their routers for a time, by group
 
 // --- Events
 #define EVENT_CONFIG_CHANGE "/mgmtd/notify/dbchange" // after each commit

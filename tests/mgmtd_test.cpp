@@ -10,6 +10,7 @@
 
 #include <gtest/gtest.h>
 #include <malloc.h>
+#include <poll.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <sys/wait.h>
@@ -810,6 +811,121 @@ TEST_F(Mgmtd, ReportsStandUntilTheirSessionEndsAndAreBounded) {
     EXPECT_LT(kept, ALARMS_MAX * 1024);
 }
 
+// --- Groups that are out of their routers for a time
+
+TEST_F(Mgmtd, AGroupThatIsOutOfItsRoutersIsDownForWccpdAlone) {
+    const std::string admin = GROUP + "/admin", left = "/qv/alarms/state/left/51";
+    const auto seen_by = [&](uint32_t peer_id) {
+        query(peer_id, admin, bn_query_get);
+        return found().empty() ? "" : found().front().substr(admin.size() + 1);
+    };
+    const auto report = [&](uint32_t peer_id, const char *event, std::vector<event_field> more = {}) {
+        more.push_back({"group", {bn_type_uint8, "51"}});
+        clear();
+        EXPECT_TRUE(give(peer_id, make_event(event, more)));
+        return changes();
+    };
+    const event_field reason = {"reason", {bn_type_str, "proxy down: status 503"}};
+    const strings goes = {admin + "=up>down"}, comes = {admin + "=down>up"};
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/interface", "eth0"},
+                   {bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"},
+                   {bn_set_create, NODE_INTERCEPT_CONFIG "/51/ports", "80"},
+                   {bn_set_create, NODE_INTERCEPT_CONFIG "/51/to", "3128"}}),
+              0u)
+        << message();
+    action(3, "/mgmtd/events/actions/interest/add", {{"event_name", {bn_type_name, EVENT_CONFIG_CHANGE}}});
+    const std::string saved = content();
+    EXPECT_EQ(report(3, EVENT_GROUP_LEAVE, {reason}), strings{}) << "only tunneld may say so";
+    server_peer_opened(&daemon, 5, "tunneld-9");
+    EXPECT_EQ(report(5, EVENT_GROUP_LEAVE, {reason}), goes);
+    EXPECT_EQ(events(3).size(), 0u);
+    EXPECT_EQ(seen_by(1) + " " + seen_by(3), "down up");
+    EXPECT_EQ(content(), saved);
+    query(3, left, bn_query_get);
+    EXPECT_EQ(found(), strings{left + "=proxy down: status 503"});
+    EXPECT_EQ(report(5, EVENT_GROUP_LEAVE, {reason}), strings{}) << "it knows already";
+
+    // What is configured meanwhile does not bring the group up.
+    for (const char *word : {"down", "up"}) {
+        EXPECT_EQ(set({{bn_set_modify, admin, word}}), 0u);
+        EXPECT_EQ(changes(), strings{});
+        EXPECT_EQ(events(3).size(), 1u);
+        EXPECT_EQ(seen_by(1) + " " + seen_by(3), std::string("down ") + word);
+    }
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/priority", "7"}}), 0u);
+    EXPECT_TRUE(has(changes(), admin + "=->down")) << "it is created again in wccpd";
+    EXPECT_EQ(report(5, EVENT_GROUP_JOIN), comes);
+    EXPECT_EQ(seen_by(1), "up");
+    EXPECT_EQ(report(5, EVENT_GROUP_JOIN), strings{});
+
+    // tunneld goes: for a time another may take over.
+    const auto tick = [&](int64_t after_ms) {
+        clear();
+        now += after_ms;
+        (void)server_tick(&daemon);
+        return changes();
+    };
+    EXPECT_EQ(report(5, EVENT_GROUP_LEAVE, {reason}), goes);
+    server_peer_closed(&daemon, 5);
+    EXPECT_EQ(tick(LEFT_KEEP_MS - 1), strings{});
+    server_peer_opened(&daemon, 6, "tunneld-10");
+    EXPECT_EQ(tick(LEFT_KEEP_MS), strings{});
+    EXPECT_EQ(report(6, EVENT_PROXY_CHANGE, {{"up", {bn_type_bool, "false"}}}), strings{});
+    EXPECT_EQ(report(6, EVENT_PROXY_CHANGE, {{"up", {bn_type_bool, "true"}}}), comes);
+    EXPECT_EQ(report(6, EVENT_GROUP_LEAVE, {reason}), goes);
+    server_peer_closed(&daemon, 6);
+    clear();
+    EXPECT_EQ(server_tick(&daemon), now + LEFT_KEEP_MS);
+    EXPECT_EQ(tick(LEFT_KEEP_MS), comes);
+    query(3, left, bn_query_get);
+    EXPECT_EQ(found(), strings{});
+
+    // With the group it goes, and doesn't come back with it.
+    server_peer_opened(&daemon, 7, "tunneld-11");
+    EXPECT_EQ(report(7, EVENT_GROUP_LEAVE, {reason}), goes);
+    EXPECT_EQ(set({{bn_set_delete, GROUP, ""}}), 0u);
+    EXPECT_TRUE(daemon.left.empty());
+    EXPECT_EQ(report(7, EVENT_GROUP_LEAVE, {reason}), strings{});
+    EXPECT_TRUE(daemon.left.empty());
+    EXPECT_EQ(set({{bn_set_create, GROUP + "/interface", "eth0"}}), 0u);
+    EXPECT_TRUE(has(changes(), admin + "=->up"));
+}
+
+// --- Bypasses
+
+TEST_F(Mgmtd, BypassesEndByThemselves) {
+    const std::string root = NODE_BYPASS_CONFIG;
+    int64_t clock = 1000;
+    daemon.clock_s = [&] { return clock; };
+    std::ofstream(daemon.file.path) << "[" << root << "]\n10.0.0.0\\/8/until = 900\n10.1.0.0\\/16/until = 0\n"
+                                    << "10.2.0.0\\/16/until = 1010\n10.3.0.0\\/16/until = 1010\n";
+    std::string errors, warnings;
+    ASSERT_TRUE(server_load(&daemon, &errors, &warnings)) << errors;
+    const auto kept = [&] {
+        query(3, root, bn_query_iterate);
+        strings out;
+        for (const std::string &each : found())
+            out.push_back(each.substr(each.find('=') + 1));
+        return out;
+    };
+    const uint32_t before = daemon.tree.revision;
+    EXPECT_EQ(server_tick(&daemon), now + 10000);
+    EXPECT_EQ(kept(), (strings{"10.1.0.0/16", "10.2.0.0/16", "10.3.0.0/16"}));
+    EXPECT_EQ(content().find("10.0.0.0"), std::string::npos) << content();
+    clock += 10;
+    now += 10000;
+    EXPECT_EQ(server_tick(&daemon), -1);
+    EXPECT_EQ(kept(), strings{"10.1.0.0/16"});
+    EXPECT_EQ(daemon.tree.revision, before + 2) << "one commit for all that are due";
+    // One that can't be deleted is tried again, not at each turn.
+    ASSERT_EQ(set({{bn_set_create, root + "/10.4.0.0\\/16/until", "1011"}}), 0u);
+    daemon.file.path = std::string(file) + "/no/such/directory";
+    clock++;
+    EXPECT_EQ(server_tick(&daemon), now + 60000);
+    EXPECT_EQ(server_tick(&daemon), now + 60000);
+    EXPECT_EQ(kept().size(), 2u);
+}
+
 // --- Supervision
 
 TEST(Supervision, AnEndHasItsNameAndTheNextStartItsDelay) {
@@ -843,4 +959,74 @@ TEST(Supervision, AChildWhoseEndSomebodyElseTookInIsOver) {
     supervisor_reap(&self);
     EXPECT_TRUE(supervisor_is_done(self));
     EXPECT_EQ(told, strings{EVENT_PROCESS_EXIT});
+}
+
+// tunneld is killed: whether anybody hears of it depends on how soon the next one has its session.
+TEST(Supervision, ALossIsReportedWhenNobodyTakesOverInTime) {
+    strings told;
+    std::string said;
+    int64_t now = 100000;
+    supervisor self;
+    self.children.push_back({"tunneld", {"sleep", "100"}});
+    self.children[0].takes_over = true;
+    self.now_ms = [&] { return now; };
+    self.say = [&](const std::string &line) { said += line + "\n"; };
+    self.tell = [&](const std::string &event, const std::string &) { told.push_back(event); };
+    child &tunneld = self.children[0];
+    const auto open_session = [&] {
+        supervisor_session_opened(&self, "tunneld-" + std::to_string(tunneld.pid));
+    };
+    // Ends after a run of so long. Gives the time of the next thing to do, from then on.
+    const auto end = [&](int signal, int64_t ran_ms) {
+        now += ran_ms;
+        kill(tunneld.pid, signal);
+        pollfd ended = {tunneld.pidfd, POLLIN, 0};
+        EXPECT_EQ(poll(&ended, 1, 5000), 1);
+        supervisor_reap(&self);
+        return supervisor_tick(&self) - now;
+    };
+    (void)supervisor_tick(&self);
+    open_session();
+    EXPECT_EQ(end(SIGKILL, 1000), TAKE_OVER_MS);
+    EXPECT_FALSE(supervisor_is_done(self)) << "started again at once";
+    supervisor_session_opened(&self, "tunneld-1");
+    now += TAKE_OVER_MS - 1;
+    (void)supervisor_tick(&self);
+    said.clear();
+    open_session();
+    EXPECT_EQ(said, "process tunneld: ended by SIGKILL, replaced after 2999 ms\n");
+    now++;
+    EXPECT_EQ(supervisor_tick(&self), -1);
+    EXPECT_EQ(told, strings{});
+
+    // Too late; and the one that never had a session is started by the usual delays, within the same loss.
+    EXPECT_EQ(end(SIGKILL, 1000), TAKE_OVER_MS);
+    EXPECT_EQ(end(SIGKILL, 10), RESTART_DELAY_FIRST_MS);
+    EXPECT_EQ(told, strings{});
+    now += TAKE_OVER_MS - 10;
+    (void)supervisor_tick(&self);
+    EXPECT_EQ(told, strings{EVENT_PROCESS_CRASH});
+    open_session();
+    EXPECT_EQ(said.find("replaced after 30"), std::string::npos) << said;
+
+    // One that ends as soon as it has taken over is not started again and again without a pause.
+    EXPECT_GT(end(SIGKILL, SHORT_RUN_MS - 1), 0);
+    EXPECT_TRUE(supervisor_is_done(self));
+    now += RESTART_DELAY_MAX_MS;
+    (void)supervisor_tick(&self);
+    told.clear();
+
+    // An orderly end is one, and so is the end of everything.
+    open_session();
+    EXPECT_GE(end(SIGTERM, 1000), RESTART_DELAY_FIRST_MS);
+    EXPECT_EQ(told, strings{EVENT_PROCESS_TERMINATE});
+    now += RESTART_DELAY_MAX_MS;
+    (void)supervisor_tick(&self);
+    open_session();
+    (void)end(SIGKILL, 1000);
+    self.ending = true;
+    (void)supervisor_tick(&self);
+    (void)end(SIGKILL, TAKE_OVER_MS);
+    EXPECT_EQ(told, (strings{EVENT_PROCESS_TERMINATE, EVENT_PROCESS_TERMINATE}));
+    EXPECT_TRUE(supervisor_is_done(self));
 }

@@ -45,11 +45,13 @@ static std::vector<event_changes> events_for(const peer &who, std::span<const ch
 }
 
 static void send_change_events(server *self, const node_tree &before, const commit_result &commit) {
-    const wccpd_plan plan = plan_for_wccpd(before, self->tree, commit);
+    wccpd_plan plan = plan_for_wccpd(before, self->tree, commit);
+    for (change_list &changes : plan.events)
+        server_adapt_for_wccpd(self, &changes);
     std::vector<std::pair<uint32_t, event_changes>> events;
     bool recreates = false;
     for (const auto &[id, who] : self->peers) {
-        const bool runs_groups = who.name.starts_with("wccpd-");
+        const bool runs_groups = server_runs_groups(who);
         for (event_changes &event :
              events_for(who, runs_groups ? std::span(plan.events) : std::span(&commit.changes, 1))) {
             events.emplace_back(id, std::move(event));
@@ -59,6 +61,18 @@ static void send_change_events(server *self, const node_tree &before, const comm
     if (recreates)
         for (const node_name &root : plan.recreated)
             self->say("service group " + root.parts.back() + " is deleted and created again in wccpd");
+    for (const auto &[id, event] : events) {
+        const owned_request msg(make_change_event(event));
+        (void)server_send_request(self, id, msg.pointer);
+    }
+}
+
+void server_send_to_wccpd(server *self, const change_list &changes) {
+    std::vector<std::pair<uint32_t, event_changes>> events;
+    for (const auto &[id, who] : self->peers)
+        if (server_runs_groups(who))
+            for (event_changes &event : events_for(who, std::span(&changes, 1)))
+                events.emplace_back(id, std::move(event));
     for (const auto &[id, event] : events) {
         const owned_request msg(make_change_event(event));
         (void)server_send_request(self, id, msg.pointer);
@@ -102,6 +116,8 @@ static void take_over(server *self, node_tree next, const commit_result &commit)
     if (facility_of(before) != facility_of(self->tree))
         write_facility(self);
     send_change_events(self, before, commit);
+    server_forget_deleted_groups(self);
+    self->expire_at_ms = 0;
 }
 
 // What mgmtd refuses beyond what a tree by itself shows.
@@ -136,6 +152,38 @@ commit_result server_commit(server *self, const std::vector<set_step> &steps, co
               std::to_string(result.changes.size()) + " nodes changed");
     take_over(self, std::move(next), result);
     return result;
+}
+
+// --- Bypasses that end by themselves
+
+// The clock may be set: while there is an entry with a time, it is looked at each minute.
+static constexpr int64_t CLOCK_LOOK_MS = 60000;
+
+int64_t server_expire_bypasses(server *self) {
+    static const node_name pattern = parsed_name(NODE_BYPASS_CONFIG "/*/until");
+    static const node_name root = parsed_name(NODE_BYPASS_CONFIG);
+    const int64_t now = self->now_ms();
+    if (self->expire_at_ms < 0 || now < self->expire_at_ms)
+        return self->expire_at_ms;
+    const int64_t clock = self->clock_s();
+    std::vector<set_step> over;
+    int64_t left_ms = -1;
+    for (auto at = self->tree.nodes.upper_bound(root);
+         at != self->tree.nodes.end() && at->first.is_under(root); ++at) {
+        const int64_t until = matches(pattern, at->first) ? std::stoll(at->second.text) : 0;
+        if (until == 0)
+            continue;
+        if (until <= clock)
+            over.push_back(
+                {set_kind::remove, root.below(at->first.parts[root.parts.size()]).text(), bn_type_none, ""});
+        const int64_t wait = until <= clock ? CLOCK_LOOK_MS : (until - clock) * 1000;
+        left_ms = std::min(left_ms < 0 ? CLOCK_LOOK_MS : left_ms, wait);
+    }
+    // A commit that is refused is tried again at the next look; one that is not has it looked at anew.
+    const int64_t next = left_ms < 0 ? -1 : now + left_ms;
+    if (over.empty() || server_commit(self, over, "mgmtd: the time of bypasses is over").code != 0)
+        return self->expire_at_ms = next;
+    return self->expire_at_ms = 0, server_expire_bypasses(self);
 }
 
 // --- The file

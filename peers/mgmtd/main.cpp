@@ -109,6 +109,8 @@ int main(int argc, char **argv) {
     };
     if (supervise) {
         processes.children.push_back({"tunneld", {tunneld}});
+        processes.children.back().takes_over = true;
+        daemon.opened = [&](const std::string &name) { supervisor_session_opened(&processes, name); };
         processes.children.push_back({"wccpd", {wccpd}});
     }
     for (;;) {

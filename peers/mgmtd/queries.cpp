@@ -8,7 +8,9 @@
 //
 // A walk of all service groups is asked for in steps: the list of groups first, then one group after the
 // other. The daemon therefore never builds an answer about more than one group, and a walk that comes to more
-// than a frame is refused here as soon as that is known.
+// than a frame is refused here as soon as that is known. A walk above the roots of several daemons asks one
+// after the other, in the order of the table.
+//
 // A node that can't be put into a message is left out, so that no asker waits in vain. The daemon
 // whose session it is asks for its configuration only; it is never asked for what it asked for.
 #include <algorithm>
@@ -28,6 +30,7 @@ struct state_source {
 
 static const state_source sources[] = {
     {"wccpd", {NODE_WCCPD_STATE, NODE_GROUP_STATE}, wccpd_state_nodes},
+    {"tunneld", {NODE_PLANE_STATE, NODE_TUNNEL_STATE, NODE_INTERCEPT_STATE}, tunneld_state_nodes},
 };
 static constexpr uint32_t CAPABILITIES = 1;       // the nodes can be read
 static constexpr size_t ANSWER_NODE_BYTES = 64;   // of a node in a message, beside its texts
@@ -64,35 +67,32 @@ static bool append_registrations(bn_request_msg *msg, const state_source &source
     return true;
 }
 
-namespace {
-struct query_plan {
-    const state_source *source = nullptr;
-    std::vector<asked_node> nodes; // of the request to the daemon
-    std::vector<asked_node> walks; // of all groups
-    bool explicit_node = false;
-};
-} // namespace
-
 static bool within(const node_name &name, const node_name &root) {
     return name == root || name.is_under(root);
 }
 
+static daemon_part *part_for(std::vector<daemon_part> *parts, size_t source) {
+    for (daemon_part &part : *parts)
+        if (part.source == source)
+            return &part;
+    parts->push_back({source, {}, {}, false});
+    return &parts->back();
+}
+
 // Which of the node's answers come from a daemon.
-static void plan_node(query_plan *plan, uint32_t node_id, uint32_t subop, uint32_t flags,
-                      const node_name &name) {
-    for (const state_source &source : sources)
-        for (const char *text : source.roots) {
-            node_name root;
-            (void)parse_node_name(text, &root);
-            const bool asked = within(name, root);
-            const bool subtree = subop == bn_query_iterate && (flags & bn_qf_subtree);
-            if (!asked && !(subtree && root.is_under(name)))
+static void plan_node(std::vector<daemon_part> *parts, const asked_node &asked, const node_name &name) {
+    const bool subtree = asked.subop == bn_query_iterate && (asked.flags & bn_qf_subtree);
+    for (size_t source = 0; source < std::size(sources); source++)
+        for (const char *text : sources[source].roots) {
+            const node_name root = parsed_name(text);
+            const bool by_name = within(name, root);
+            if (!by_name && !(subtree && root.is_under(name)))
                 continue;
-            const asked_node node = {node_id, subop, flags, asked ? name.text() : text};
-            plan->source = &source;
-            plan->explicit_node |= asked;
-            (subtree && node.name == NODE_GROUP_STATE ? plan->walks : plan->nodes).push_back(node);
-            if (asked)
+            const asked_node node = {asked.id, asked.subop, asked.flags, by_name ? name.text() : text};
+            daemon_part *part = part_for(parts, source);
+            part->whole |= by_name;
+            (subtree && node.name == NODE_GROUP_STATE ? part->walks : part->nodes).push_back(node);
+            if (by_name)
                 return;
         }
 }
@@ -128,6 +128,8 @@ static void refuse_query(server *self, const pending_query &query, uint32_t code
 // What mgmtd answers itself. False when that is more than a message holds: the query has been refused.
 static bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
     size_t bytes = query.gathered_bytes;
+    const auto asker = self->peers.find(query.asker);
+    const bool runs_groups = asker != self->peers.end() && server_runs_groups(asker->second);
     for (const asked_node &asked : query.asked) {
         node_name name;
         node_list found;
@@ -140,7 +142,9 @@ static bool append_own_answers(server *self, const pending_query &query, bn_resp
                 refuse_query(self, query, LC_NO_BUFFER_SPACE, BN_TOO_LARGE);
                 return false;
             }
-            (void)append_answer(response, asked.id, text, entry->second);
+            (void)append_answer(response, asked.id, text,
+                                runs_groups ? server_value_for_wccpd(self, entry->first, entry->second)
+                                            : entry->second);
         }
     }
     return true;
@@ -200,10 +204,12 @@ static uint32_t forward(server *self, const std::vector<asked_node> &nodes, bool
     query.bytes = 0;
     for (const asked_node &node : query.asked)
         query.bytes += node.name.size() + PENDING_NODE_BYTES;
-    query.bytes += (nodes.size() + query.walks.size()) * PENDING_NODE_BYTES;
+    for (const daemon_part &part : query.parts)
+        query.bytes += (part.nodes.size() + part.walks.size()) * PENDING_NODE_BYTES;
     if (!may_wait(self, query))
         return LC_NO_SPACE;
-    const owned_request msg(make_forwarded(sources[query.source], nodes, list_groups, &query));
+    const owned_request msg(
+        make_forwarded(sources[query.parts[query.next_part - 1].source], nodes, list_groups, &query));
     if (!msg.pointer)
         return LC_IO_CLOSED;
     const uint32_t id = msg.pointer->msg_id = self->next_query_id++, provider = query.provider;
@@ -217,16 +223,20 @@ static uint32_t forward(server *self, const std::vector<asked_node> &nodes, bool
     return LC_IO_CLOSED;
 }
 
-// Sends what mgmtd answers itself and what the daemon has answered. A limit that was met is reported to every
-// asker; another failure of the daemon only to those who asked for its nodes by name.
+static bool is_limit(uint32_t code) {
+    return code == LC_NO_SPACE || code == LC_NO_BUFFER_SPACE;
+}
+
+// Sends what mgmtd answers itself and what the daemons have answered. A limit that was met is reported to
+// every asker, and leaves no room for anything else.
 static void finish_query(server *self, const pending_query &query, uint32_t code, const std::string &words) {
-    if (code == LC_NO_SPACE || code == LC_NO_BUFFER_SPACE) {
+    if (is_limit(code)) {
         refuse_query(self, query, code, words);
         return;
     }
     owned_response response;
-    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, query.whole ? code : 0,
-                                     query.whole ? words.c_str() : "") != LC_OK ||
+    if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, code, words.c_str()) !=
+            LC_OK ||
         !append_own_answers(self, query, response.pointer))
         return;
     const bn_response_per_node_array *nodes = query.gathered ? query.gathered->nodes : nullptr;
@@ -237,14 +247,40 @@ static void finish_query(server *self, const pending_query &query, uint32_t code
     (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
 }
 
-static void fail_to_ask(server *self, const pending_query &query, uint32_t code) {
-    const std::string daemon = sources[query.source].client;
-    finish_query(self, query, code,
-                 code == LC_NO_SPACE ? "Too many queries wait for " + daemon : daemon + " has no session");
+static void ask_next(server *self, pending_query query);
+
+// The daemon under way has answered all, or failed. A failure is reported to those who asked for its nodes by
+// name; to others it is nothing.
+static void end_part(server *self, pending_query query, uint32_t code, const std::string &words) {
+    const bool whole = query.next_part > 0 && query.parts[query.next_part - 1].whole;
+    if (is_limit(code) || (code != LC_OK && whole))
+        finish_query(self, query, code, words);
+    else
+        ask_next(self, std::move(query));
+}
+
+static void fail_to_ask(server *self, pending_query query, uint32_t code) {
+    const std::string daemon = sources[query.parts[query.next_part - 1].source].client;
+    end_part(self, std::move(query), code,
+             code == LC_NO_SPACE ? "Too many queries wait for " + daemon : daemon + " has no session");
+}
+
+static void ask_next(server *self, pending_query query) {
+    if (query.next_part == query.parts.size()) {
+        finish_query(self, query, LC_OK, "");
+        return;
+    }
+    const daemon_part part = query.parts[query.next_part++];
+    query.groups.clear();
+    query.next_group = 0;
+    query.provider = find_provider(self, sources[part.source], query.asker);
+    const uint32_t code =
+        query.provider ? forward(self, part.nodes, !part.walks.empty(), query) : uint32_t{LC_IO_CLOSED};
+    if (code != LC_OK)
+        fail_to_ask(self, std::move(query), code);
 }
 
 void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
-    query_plan plan;
     pending_query query = {};
     query.asker = peer_id;
     query.asker_message_id = msg->msg_id;
@@ -252,25 +288,16 @@ void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
     query.asked = nodes_asked_for(msg);
     for (const asked_node &node : query.asked)
         if (node_name name; parse_node_name(node.name, &name))
-            plan_node(&plan, node.id, node.subop, node.flags, name);
-    if (!plan.source) {
-        finish_query(self, query, LC_OK, "");
-        return;
-    }
-    query.whole = plan.explicit_node;
-    query.source = static_cast<size_t>(plan.source - sources);
-    query.walks = std::move(plan.walks);
-    query.provider = find_provider(self, *plan.source, peer_id);
-    const uint32_t code =
-        query.provider ? forward(self, plan.nodes, !query.walks.empty(), query) : uint32_t{LC_IO_CLOSED};
-    if (code != LC_OK)
-        fail_to_ask(self, query, code);
+            plan_node(&query.parts, node, name);
+    ask_next(self, std::move(query));
 }
 
 void server_answer_without(server *self, pending_query query, uint32_t code, const std::string &why) {
-    query.gathered.reset();
-    query.gathered_bytes = 0;
-    finish_query(self, query, code, why);
+    if (query.next_part == 1) { // half an answer is none; what another daemon has answered is kept
+        query.gathered.reset();
+        query.gathered_bytes = 0;
+    }
+    end_part(self, std::move(query), code, why);
 }
 
 // Takes over the daemon's bindings. False when a limit is met: the query has been refused.
@@ -310,10 +337,11 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
     if (!gather(self, &query, msg, bytes))
         return;
     if (msg->return_code != LC_OK || query.next_group == query.groups.size()) {
-        finish_query(self, query, msg->return_code, msg->return_message ? ts_str(msg->return_message) : "");
+        end_part(self, std::move(query), msg->return_code,
+                 msg->return_message ? ts_str(msg->return_message) : "");
         return;
     }
-    std::vector<asked_node> nodes = query.walks;
+    std::vector<asked_node> nodes = query.parts[query.next_part - 1].walks;
     for (asked_node &node : nodes) {
         node.name = query.groups[query.next_group];
         node.flags |= bn_qf_include_self;
@@ -321,5 +349,5 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
     query.next_group++;
     const uint32_t code = forward(self, nodes, false, query);
     if (code != LC_OK)
-        fail_to_ask(self, query, code);
+        fail_to_ask(self, std::move(query), code);
 }

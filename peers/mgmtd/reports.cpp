@@ -2,6 +2,8 @@
 //
 //   /qv/alarms/state/raised/TYPE/SOURCE          the text of the alarm; below it name, since, reporter
 //   /qv/alarms/state/role/GROUP                  the role's name; below it code, since
+//   /qv/alarms/state/left/GROUP                  why it is out of its routers; below it since
+//   (left_groups.cpp)
 //
 // TYPE is the number of the alarm, SOURCE says what it is about. A report that comes again replaces the one
 // before. Alarms are not resent by whoever raised them, so those of a session that ends are taken as
@@ -17,7 +19,7 @@
 // message.
 static constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
 
-static node_value time_now() {
+node_value server_time_now() {
     owned_text text;
     const auto now = static_cast<lt_time_sec>(time(nullptr));
     if (lt_datetime_sec_to_str(now, 0, &text.pointer) != LC_OK || !text.pointer)
@@ -25,7 +27,7 @@ static node_value time_now() {
     return {bn_type_datetime_sec, text.pointer};
 }
 
-static void remove_report(server *self, const node_name &root) {
+void server_remove_report(server *self, const node_name &root) {
     self->alarm_owners.erase(root);
     self->state.erase(root);
     for (auto at = self->state.lower_bound(root); at != self->state.end() && at->first.is_under(root);)
@@ -60,14 +62,14 @@ static void take_raise(server *self, uint32_t peer_id, const std::vector<event_f
     const std::string comment = text_or(fields, "comment", "", TEXT_MAX);
     self->state[root] = {bn_type_str, comment};
     self->state[root.below("name")] = {bn_type_str, alarm_name(root.parts[root.parts.size() - 2])};
-    self->state[root.below("since")] = time_now();
+    self->state[root.below("since")] = server_time_now();
     self->state[root.below("reporter")] = {bn_type_str, self->peers[peer_id].name};
     self->say("alarm raised: " + root.parts.back() + " " + comment);
 }
 
 static void take_clear(server *self, uint32_t, const std::vector<event_field> &fields) {
     const node_name root = alarm_root(fields);
-    remove_report(self, root);
+    server_remove_report(self, root);
     self->say("alarm cleared: " + root.parts.back() + " " + text_or(fields, "comment", "", TEXT_MAX));
 }
 
@@ -81,7 +83,7 @@ static void take_role(server *self, uint32_t peer_id, const std::vector<event_fi
         code = "0";
     self->state[root] = {bn_type_str, role};
     self->state[root.below("code")] = {bn_type_uint32, code};
-    self->state[root.below("since")] = time_now();
+    self->state[root.below("since")] = server_time_now();
     self->say("role of group " + root.parts.back() + ": " + role);
 }
 
@@ -89,9 +91,9 @@ static const struct {
     const char *event;
     void (*take)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
 } reports[] = {
-    {EVENT_RAISE_ALARM, take_raise},
-    {EVENT_CLEAR_ALARM, take_clear},
-    {EVENT_ROLE_CHANGE, take_role},
+    {EVENT_RAISE_ALARM, take_raise},      {EVENT_CLEAR_ALARM, take_clear},
+    {EVENT_ROLE_CHANGE, take_role},       {EVENT_GROUP_LEAVE, server_take_leave},
+    {EVENT_GROUP_JOIN, server_take_join}, {EVENT_PROXY_CHANGE, server_take_proxy_change},
 };
 
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,
@@ -111,7 +113,7 @@ void server_forget_reports(server *self, uint32_t peer_id) {
         if (owner == peer_id)
             gone.push_back(root);
     for (const node_name &root : gone) {
-        remove_report(self, root);
+        server_remove_report(self, root);
         self->say("forgotten with its session: " + root.text());
     }
 }

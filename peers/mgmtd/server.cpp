@@ -241,6 +241,8 @@ void server_peer_opened(server *self, uint32_t peer_id, const std::string &name)
     who.name = name;
     who.first_seen = ++self->peers_seen;
     self->say("session of " + name + " open");
+    if (self->opened)
+        self->opened(name);
 }
 
 void server_peer_closed(server *self, uint32_t peer_id) {
@@ -261,18 +263,16 @@ void server_peer_closed(server *self, uint32_t peer_id) {
     for (const pending_query &query : left)
         server_answer_without(self, query, LC_IO_CLOSED, name + " ended its session before it answered");
     server_forget_reports(self, peer_id);
+    server_orphan_left_groups(self, peer_id);
 }
 
-int64_t server_tick(server *self) {
+static void answer_late_queries(server *self) {
     const int64_t now = self->now_ms();
-    int64_t next = -1;
     std::vector<pending_query> late;
     for (auto at = self->pending.begin(); at != self->pending.end();) {
         const auto query = at++;
         if (query->second.deadline_ms <= now)
             late.push_back(server_take_pending(self, query));
-        else if (next < 0 || query->second.deadline_ms < next)
-            next = query->second.deadline_ms;
     }
     for (const pending_query &query : late) {
         const auto provider = self->peers.find(query.provider);
@@ -280,6 +280,20 @@ int64_t server_tick(server *self) {
         self->say("query: no answer from " + name);
         server_answer_without(self, query, LC_IO_TIMED_OUT, name + " did not answer in time");
     }
+}
+
+static void take_earlier(int64_t *inout, int64_t at_ms) {
+    if (at_ms >= 0 && (*inout < 0 || at_ms < *inout))
+        *inout = at_ms;
+}
+
+int64_t server_tick(server *self) {
+    int64_t next = -1;
+    answer_late_queries(self);
+    take_earlier(&next, server_drop_left_groups(self));
+    take_earlier(&next, server_expire_bypasses(self));
+    for (const auto &[id, query] : self->pending) // also those that have gone on to another daemon
+        take_earlier(&next, query.deadline_ms);
     return next;
 }
 

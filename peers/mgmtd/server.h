@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstdint>
+#include <ctime>
 #include <functional>
 #include <map>
 #include <memory>
@@ -37,24 +38,38 @@ struct asked_node {
     uint32_t id, subop, flags;
     std::string name;
 };
+// What a query asks one daemon for.
+struct daemon_part {
+    size_t source;                 // the daemon, by its place in the table of daemons
+    std::vector<asked_node> nodes; // of the request to the daemon
+    std::vector<asked_node> walks; // of all groups, which are asked for one after the other
+    bool whole;                    // asked for by name: no answer is a failure
+};
 // A query that waits for the daemon whose nodes it asks for. What mgmtd answers of it itself is looked up
 // when the daemon has answered, and not kept until then.
 struct pending_query {
     uint32_t asker, provider;
     uint32_t asker_message_id, asker_transaction_id;
     int64_t deadline_ms;
-    bool whole;                            // it asks for the daemon's nodes by name: no answer is a failure
     std::vector<asked_node> asked;         // as they came
     std::map<uint32_t, uint32_t> node_ids; // of the forwarded query to the asker's
     size_t bytes;                          // that count against PENDING_BYTES_MAX
-    size_t source;                         // the daemon, by its place in the table of daemons
-    std::vector<asked_node> walks;         // of all groups, which are asked for one after the other
+    std::vector<daemon_part> parts;        // daemons that it asks, one after the other
+    size_t next_part;                      // the one before it is under way
     uint32_t list_id;                      // of the forwarded query that lists the groups, or 0
     std::vector<std::string> groups;       // their names
     size_t next_group;
-    std::shared_ptr<bn_response_msg> gathered; // what the daemon has answered so far
+    std::shared_ptr<bn_response_msg> gathered; // what daemons have answered so far
     size_t gathered_bytes;                     // of it in messages
 };
+
+// A group that is out of its routers for a time, without a change of the configuration: wccpd is given "down"
+// for its admin, everybody else what is configured.
+struct left_group {
+    uint32_t reporter;   // tunneld's session, 0 when it has ended
+    int64_t orphaned_ms; // when it has
+};
+constexpr int64_t LEFT_KEEP_MS = 10000; // without a session of tunneld
 
 struct server {
     // Whether the peer's queue takes so many bytes more; null: always.
@@ -63,6 +78,8 @@ struct server {
     std::function<void(uint32_t peer_id, uint16_t mtype, tbuffer *frame)> send;
     std::function<int64_t()> now_ms; // monotonic
     std::function<void(const std::string &line)> say;
+    std::function<int64_t()> clock_s = [] { return static_cast<int64_t>(time(nullptr)); }; // since 1970
+    std::function<void(const std::string &name)> opened; // each session, once it is; null: nobody cares
     std::function<std::vector<local_address>()> local_addresses = find_local_addresses;
     std::string facility_file; // where programs read the log facility when they start; "": nowhere
 
@@ -76,13 +93,16 @@ struct server {
     std::map<node_name, uint32_t> alarm_owners;   // root nodes of what a session reported
     uint32_t next_query_id = 0x40000000;          // apart from the ids of other messages
     uint64_t peers_seen = 0;
+    std::map<uint8_t, left_group> left;
+    int64_t expire_at_ms = 0; // when bypass entries are looked at again; -1: not before a commit
 };
 
 void server_peer_opened(server *self, uint32_t peer_id, const std::string &name);
 void server_peer_closed(server *self, uint32_t peer_id);
 // A frame of protocol 2, whole. False: it could not be read, and the session ends.
 bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame);
-// Answers the queries whose time is over. Gives the time of the next one, or -1.
+// Answers the queries whose time is over, and ends what lasts for a time only. Gives the time of the next
+// thing to do, or -1.
 int64_t server_tick(server *self);
 
 void server_send_event(server *self, const std::string &event, const std::vector<event_field> &fields);
@@ -111,3 +131,21 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,
                        const std::vector<event_field> &fields);
 void server_forget_reports(server *self, uint32_t peer_id);
+node_value server_time_now();
+// Takes a node of `state` out, with those below it.
+void server_remove_report(server *self, const node_name &root);
+
+// Groups that are out of their routers, in left_groups.cpp.
+void server_take_leave(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+void server_take_join(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+void server_take_proxy_change(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+void server_orphan_left_groups(server *self, uint32_t peer_id);
+int64_t server_drop_left_groups(server *self); // the time of the next look, or -1
+bool server_runs_groups(const peer &who);      // it is wccpd's
+// The value of the node as wccpd is to see it.
+node_value server_value_for_wccpd(const server *self, const node_name &name, const node_value &value);
+void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout);
+void server_forget_deleted_groups(server *self);
+void server_send_to_wccpd(server *self, const std::vector<node_change> &changes);
+// Bypass entries whose time is over are deleted by a commit. Gives the time of the next look, or -1.
+int64_t server_expire_bypasses(server *self);

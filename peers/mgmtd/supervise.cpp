@@ -3,6 +3,10 @@
 // each end and falls back after a run that lasted. Children get default signal handling, an empty signal
 // mask and SIGTERM should mgmtd die before them, so that its next start finds none of them left.
 //
+// A child that takes over is different: when it is killed or fails after it has had a session, it is started
+// again at once, and its loss is reported only if the new process has no session in time. Until then nothing
+// is lost, for the kernel carries the packets.
+//
 // A child is held by a descriptor of the process and not by its number: the number may be another process's
 // as soon as somebody else has taken in the child's end.
 #include "peers/mgmtd/supervise.h"
@@ -12,6 +16,7 @@
 #include <csignal>
 #include <cstdio>
 #include <cstring>
+#include <utility>
 
 #include <sys/prctl.h>
 #include <sys/wait.h>
@@ -91,6 +96,7 @@ static void start(supervisor *self, child *process) {
         return;
     }
     process->kill_at_ms = -1;
+    process->has_session = false;
     self->say("process " + process->name + ": started, pid " + std::to_string(process->pid));
 }
 
@@ -113,21 +119,63 @@ static bool has_ended(const child &process, int *out_status) {
     return true;
 }
 
+static bool is_orderly(int wait_status) {
+    return WIFSIGNALED(wait_status) ? WTERMSIG(wait_status) == SIGTERM : WEXITSTATUS(wait_status) == 0;
+}
+
+static void take_end(supervisor *self, child *process, int status) {
+    const int64_t now = self->now_ms(), ran = now - process->started_ms;
+    const bool may_be_replaced = process->takes_over && !self->ending && !is_orderly(status);
+    if (may_be_replaced && process->has_session && !process->loss)
+        process->loss = {end_event(status, false), end_text(status), now};
+    process->delay_ms =
+        process->loss && process->has_session && ran >= SHORT_RUN_MS ? 0 : next_delay(process->delay_ms, ran);
+    process->start_at_ms = now + process->delay_ms;
+    if (may_be_replaced && process->loss && process->delay_ms == 0)
+        return; // the next line says whether it has been replaced
+    self->say("process " + process->name + ": " + end_text(status) +
+              (self->ending ? "" : ", starts again in " + std::to_string(process->delay_ms / 1000) + " s"));
+    if (may_be_replaced && process->loss)
+        return;
+    process->loss.reset();
+    self->tell(end_event(status, self->ending), process->name);
+}
+
 void supervisor_reap(supervisor *self) {
     for (child &process : self->children) {
         int status = 0;
         if (!has_ended(process, &status))
             continue;
-        const int64_t now = self->now_ms();
         close(process.pidfd);
         process.pidfd = -1;
-        process.delay_ms = next_delay(process.delay_ms, now - process.started_ms);
-        process.start_at_ms = now + process.delay_ms;
-        self->say(
-            "process " + process.name + ": " + end_text(status) +
-            (self->ending ? "" : ", starts again in " + std::to_string(process.delay_ms / 1000) + " s"));
-        self->tell(end_event(status, self->ending), process.name);
+        take_end(self, &process, status);
     }
+}
+
+void supervisor_session_opened(supervisor *self, const std::string &name) {
+    for (child &process : self->children) {
+        if (process.pidfd < 0 || name != process.name + "-" + std::to_string(process.pid))
+            continue;
+        process.has_session = true;
+        if (process.loss)
+            self->say("process " + process.name + ": " + process.loss->text + ", replaced after " +
+                      std::to_string(self->now_ms() - process.loss->ended_ms) + " ms");
+        process.loss.reset();
+    }
+}
+
+// Gives the time until which the loss is not reported, or -1.
+static int64_t report_loss(supervisor *self, child *process, int64_t now) {
+    if (!process->loss)
+        return -1;
+    const int64_t due = process->loss->ended_ms + TAKE_OVER_MS;
+    if (now < due)
+        return due;
+    const process_loss loss = *std::exchange(process->loss, std::nullopt);
+    self->say("process " + process->name + ": " + loss.text + ", not replaced in " +
+              std::to_string(TAKE_OVER_MS) + " ms");
+    self->tell(loss.event, process->name);
+    return -1;
 }
 
 static int64_t end_last(supervisor *self, int64_t now) {
@@ -155,8 +203,10 @@ int64_t supervisor_tick(supervisor *self) {
     for (child &process : self->children) {
         if (process.pidfd < 0 && process.start_at_ms <= now)
             start(self, &process);
-        if (process.pidfd < 0 && (next < 0 || process.start_at_ms < next))
-            next = process.start_at_ms;
+        for (const int64_t due :
+             {process.pidfd < 0 ? process.start_at_ms : -1, report_loss(self, &process, now)})
+            if (due >= 0 && (next < 0 || due < next))
+                next = due;
     }
     return next;
 }

@@ -3,6 +3,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -14,6 +15,16 @@ constexpr int64_t SETTLED_MS = 60000; // a run of this length starts the delays 
 // From SIGTERM to SIGKILL. wccpd's orderly exit takes up to 5 s when tunneld doesn't answer.
 constexpr int64_t END_PATIENCE_MS = 10000;
 
+// For a child whose next run goes on with what the one before has left: from its end until the new process
+// has a session. Only then is the loss reported.
+constexpr int64_t TAKE_OVER_MS = 3000;
+constexpr int64_t SHORT_RUN_MS = 500; // a run that has ended sooner is not started again at once
+
+struct process_loss { // of a run whose next one may take over
+    const char *event;
+    std::string text; // "ended by SIGKILL"
+    int64_t ended_ms;
+};
 struct child {
     std::string name;
     std::vector<std::string> command;
@@ -21,6 +32,9 @@ struct child {
     int pidfd = -1; // -1: does not run
     int64_t started_ms = 0, start_at_ms = 0, delay_ms = 0;
     int64_t kill_at_ms = -1;
+    bool takes_over = false;
+    bool has_session = false; // this run has opened one
+    std::optional<process_loss> loss = {};
 };
 struct supervisor {
     std::vector<child> children; // in the order of their start
@@ -34,6 +48,8 @@ struct supervisor {
 void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout);
 // Takes in who has ended.
 void supervisor_reap(supervisor *self);
+// The session of this name, "tunneld-123", is open.
+void supervisor_session_opened(supervisor *self, const std::string &name);
 // Starts who is due, or when ending, ends one after the other, the last started first. Gives the time of the
 // next thing to do, or -1.
 int64_t supervisor_tick(supervisor *self);

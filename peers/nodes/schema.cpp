@@ -173,6 +173,42 @@ const std::vector<const char *> &wccpd_state_nodes() {
     return nodes;
 }
 
+#define SORTED(node)                                                                                         \
+    node "/in", node "/in_bytes", node "/to_proxy", node "/to_proxy_bytes", node "/bypassed",                \
+        node "/bypassed_bytes", node "/returned", node "/returned_bytes", node "/down", node "/down_bytes",  \
+        node "/forwarded", node "/forwarded_bytes", node "/dropped", node "/dropped_bytes", node "/own",     \
+        node "/own_bytes"
+
+const std::vector<const char *> &tunneld_state_nodes() {
+    static const std::vector<const char *> nodes = {
+        NODE_PLANE_STATE "/name",
+        NODE_PLANE_STATE "/reason",
+        NODE_PLANE_STATE "/clamped",
+        NODE_PLANE_STATE "/refused/*",
+        NODE_PLANE_STATE "/refused_source/*",
+        NODE_TUNNEL_STATE "/*",
+        NODE_TUNNEL_STATE "/*/local",
+        NODE_TUNNEL_STATE "/*/remote",
+        NODE_TUNNEL_STATE "/*/interface",
+        NODE_TUNNEL_STATE "/*/index",
+        NODE_TUNNEL_STATE "/*/packets_in",
+        NODE_TUNNEL_STATE "/*/bytes_in",
+        NODE_TUNNEL_STATE "/*/packets_out",
+        NODE_TUNNEL_STATE "/*/bytes_out",
+        NODE_TUNNEL_STATE "/*/fragments",
+        NODE_TUNNEL_STATE "/*/refused/*",
+        SORTED(NODE_TUNNEL_STATE "/*"),
+        NODE_INTERCEPT_STATE "/*",
+        NODE_INTERCEPT_STATE "/*/proxy",
+        NODE_INTERCEPT_STATE "/*/proxy_reason",
+        NODE_INTERCEPT_STATE "/*/proxy_ms",
+        NODE_INTERCEPT_STATE "/*/active",
+        NODE_INTERCEPT_STATE "/*/left",
+        SORTED(NODE_INTERCEPT_STATE "/*"),
+    };
+    return nodes;
+}
+
 // --- Names
 
 static bool is_number(const std::string &part) {
