@@ -35,11 +35,13 @@
 namespace {
 constexpr int32_t SERVICE = 2;
 constexpr int64_t RETRY_MS = 1000;        // between attempts to connect
-constexpr int64_t OPENING_STEP_MS = 10;   // between looks at a session that is being opened
+constexpr int64_t OPENING_STEP_MS = 10;   // between looks at a session that is being opened, at first
 constexpr int64_t OPENING_MAX_MS = 10000; // for the whole opening
 constexpr int64_t ANSWER_MAX_MS = 15000;  // then a request is made again
-constexpr int64_t ROUTERS_SOON_MS = 300;  // after what may have changed them
-constexpr int64_t ROUTERS_MISSING_MS = 5000, ROUTERS_KNOWN_MS = 30000;
+// Between questions about routers: after what may have changed them, doubled with each; from the second on
+// only while something is missing, up to the third; when nothing is.
+constexpr int64_t ROUTERS_FIRST_MS = 50, ROUTERS_SETTLED_MS = 1000, ROUTERS_MISSING_MS = 5000,
+                  ROUTERS_KNOWN_MS = 30000;
 constexpr int64_t ROUTER_KEPT_MS = 60000; // after wccpd listed it last
 constexpr int64_t NEVER = INT64_MAX;
 constexpr size_t REASON_MAX = 256;
@@ -63,10 +65,10 @@ struct mgmt_link {
     gcl_session *session = nullptr;
     loop_event *timer = nullptr;
     enum { closed, greeting, opening, open } stage = closed;
-    int64_t connect_at_ms = 0, open_by_ms = 0;
+    int64_t connect_at_ms = 0, opened_ms = 0; // `opened_ms`: when the opening began
 
     request configuration, groups, routers; // that are under way
-    int64_t read_at_ms = NEVER, ask_routers_at_ms = NEVER;
+    int64_t read_at_ms = NEVER, ask_routers_at_ms = NEVER, ask_wait_ms = ROUTERS_FIRST_MS;
     std::vector<event_field> configured, listed, states; // answers, as they came
     bool has_configured = false, has_listed = false, has_states = false;
 
@@ -132,8 +134,9 @@ void send_event(mgmt_link *link, const char *name, const std::vector<event_field
     (void)send_request(link, msg.pointer, nullptr);
 }
 
-void ask_routers_within(mgmt_link *link, int64_t delay_ms) {
-    link->ask_routers_at_ms = std::min(link->ask_routers_at_ms, lt_monotonic_ms() + delay_ms);
+void ask_routers_now(mgmt_link *link) {
+    link->ask_routers_at_ms = lt_monotonic_ms();
+    link->ask_wait_ms = ROUTERS_FIRST_MS;
 }
 
 // --- What comes. These run inside the library, with its locks held.
@@ -168,7 +171,7 @@ lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
     const std::string name = msg->text ? ts_str(msg->text) : "";
     if (name == EVENT_CONFIG_CHANGE)
         link->read_at_ms = lt_monotonic_ms();
-    ask_routers_within(link, ROUTERS_SOON_MS);
+    ask_routers_now(link);
     advance_soon(link);
     return LC_OK;
 }
@@ -255,7 +258,7 @@ void connect_quietly(mgmt_link *link) {
     if (!connected)
         return;
     link->stage = mgmt_link::greeting;
-    link->open_by_ms = lt_monotonic_ms() + OPENING_MAX_MS;
+    link->opened_ms = lt_monotonic_ms();
 }
 
 // An interest in changes is also what makes mgmtd ask this session for tunneld's state.
@@ -282,7 +285,7 @@ void step_opening(mgmt_link *link) {
             begin_session(link);
         else
             drop_session(link);
-    } else if (lt_monotonic_ms() >= link->open_by_ms) {
+    } else if (lt_monotonic_ms() >= link->opened_ms + OPENING_MAX_MS) {
         drop_session(link);
     }
 }
@@ -386,13 +389,19 @@ void ask_about_groups(mgmt_link *link) {
         (void)send_walks(link, walks, bn_qf_subtree, &link->routers);
 }
 
+int64_t routers_wait_ms(const mgmt_link *link) {
+    return link->ask_wait_ms > ROUTERS_SETTLED_MS && knows_all_routers(link)
+               ? ROUTERS_KNOWN_MS
+               : std::min(link->ask_wait_ms, ROUTERS_MISSING_MS);
+}
+
 // Takes in what has come, and gives the caller what has changed.
 void digest(mgmt_link *link) {
     configured_view next = link->view;
     const bool configured = link->has_configured;
     if (configured) {
         take_configuration(link, &next);
-        ask_routers_within(link, 0);
+        ask_routers_now(link);
     }
     const bool answered = link->has_listed || link->has_states;
     if (link->has_listed)
@@ -401,8 +410,8 @@ void digest(mgmt_link *link) {
         take_routers(link);
     if (answered)
         forget_old_routers(link);
-    if (link->has_states && !knows_all_routers(link))
-        ask_routers_within(link, ROUTERS_MISSING_MS);
+    if (link->has_states)
+        link->ask_routers_at_ms = lt_monotonic_ms() + routers_wait_ms(link);
     link->has_configured = link->has_listed = link->has_states = false;
     if (!configured && (!answered || !link->announced))
         return;
@@ -432,7 +441,8 @@ void ask(mgmt_link *link) {
     }
     if (may_ask(&link->routers, now, now) && may_ask(&link->groups, link->ask_routers_at_ms, now)) {
         (void)send_walks(link, {NODE_GROUP_STATE}, 0, &link->groups);
-        link->ask_routers_at_ms = now + (knows_all_routers(link) ? ROUTERS_KNOWN_MS : ROUTERS_MISSING_MS);
+        link->ask_routers_at_ms = now + routers_wait_ms(link);
+        link->ask_wait_ms = std::min(link->ask_wait_ms * 2, ROUTERS_MISSING_MS);
     }
 }
 
@@ -445,7 +455,7 @@ int64_t next_step_ms(const mgmt_link *link) {
         return link->connect_at_ms - now;
     case mgmt_link::greeting:
     case mgmt_link::opening:
-        return OPENING_STEP_MS;
+        return std::max(OPENING_STEP_MS, (now - link->opened_ms) / 4);
     default:
         break;
     }
@@ -521,7 +531,7 @@ bool mgmt_link_is_open(const mgmt_link *link) {
 void mgmt_link_ask_routers(mgmt_link *link) {
     if (link->stage != mgmt_link::open)
         return;
-    ask_routers_within(link, ROUTERS_SOON_MS);
+    ask_routers_now(link);
     advance_soon(link);
 }
 
