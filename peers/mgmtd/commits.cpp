@@ -167,23 +167,19 @@ int64_t server_expire_bypasses(server *self) {
         return self->expire_at_ms;
     const int64_t clock = self->clock_s();
     std::vector<set_step> over;
-    int64_t left_ms = -1;
+    int64_t wait_ms = -1;
     for (auto at = self->tree.nodes.upper_bound(root);
          at != self->tree.nodes.end() && at->first.is_under(root); ++at) {
         const int64_t until = matches(pattern, at->first) ? std::stoll(at->second.text) : 0;
-        if (until == 0)
-            continue;
-        if (until <= clock)
+        if (until != 0 && until <= clock)
             over.push_back(
                 {set_kind::remove, root.below(at->first.parts[root.parts.size()]).text(), bn_type_none, ""});
-        const int64_t wait = until <= clock ? CLOCK_LOOK_MS : (until - clock) * 1000;
-        left_ms = std::min(left_ms < 0 ? CLOCK_LOOK_MS : left_ms, wait);
+        else if (until != 0)
+            wait_ms = std::min(wait_ms < 0 ? CLOCK_LOOK_MS : wait_ms, (until - clock) * 1000);
     }
-    // A commit that is refused is tried again at the next look; one that is not has it looked at anew.
-    const int64_t next = left_ms < 0 ? -1 : now + left_ms;
-    if (over.empty() || server_commit(self, over, "mgmtd: the time of bypasses is over").code != 0)
-        return self->expire_at_ms = next;
-    return self->expire_at_ms = 0, server_expire_bypasses(self);
+    if (!over.empty() && server_commit(self, over, "mgmtd (bypasses whose time is over)").code != 0)
+        wait_ms = CLOCK_LOOK_MS; // refused, as when the file cannot be written
+    return self->expire_at_ms = wait_ms < 0 ? -1 : now + wait_ms;
 }
 
 // --- The file

@@ -4,8 +4,8 @@
 // mask and SIGTERM should mgmtd die before them, so that its next start finds none of them left.
 //
 // A child that takes over is different: when it is killed or fails after it has had a session, it is started
-// again at once, and its loss is reported only if the new process has no session in time. Until then nothing
-// is lost, for the kernel carries the packets.
+// again at once, and its loss is reported only if the new process has no session in time. What it has made in
+// the kernel is still there for the new one.
 //
 // A child is held by a descriptor of the process and not by its number: the number may be another process's
 // as soon as somebody else has taken in the child's end.

@@ -39,9 +39,9 @@ struct schema_row {
     node_name parts = {};
 };
 const std::vector<schema_row> &schema();
-// Patterns of the nodes that wccpd answers for.
+// Patterns of the nodes that the daemons answer for.
 const std::vector<const char *> &wccpd_state_nodes();
-const std::vector<const char *> &tunneld_state_nodes(); // and tunneld
+const std::vector<const char *> &tunneld_state_nodes();
 const schema_row *find_schema_row(const node_name &name); // null: there is no such node
 bool matches(const node_name &pattern, const node_name &name);
 
