@@ -1,10 +1,12 @@
-// The words of "mgmtctl group", and the commits that they become. What mgmtd and wccpd make of these is the
-// subject of tests/scenario_mgmtctl_groups.sh.
+// The words of "mgmtctl group" and of the commands for redirected traffic, and the commits that they become.
+// What mgmtd and wccpd make of those of groups is the subject of tests/scenario_mgmtctl_groups.sh.
 #include <gtest/gtest.h>
 
 #include <map>
 
+#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/groups.h"
+#include "peers/mgmtctl/intercepts.h"
 #include "runtime/common.h"
 
 namespace {
@@ -20,9 +22,10 @@ struct fake {
     std::vector<std::vector<ctl_change_item>> commits;                      // that were sent
     uint32_t code = 0;                                                      // of the answer, 1: none comes
 
-    group_result run(const std::vector<std::string> &words) {
+    group_result run(const std::vector<std::string> &words) { return group_command(link(), words); }
+    ctl_link link() {
         commits.clear();
-        group_link link;
+        ctl_link link;
         link.settle_ms = 0;
         link.query = [this](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *) {
             if (name.find("/state") != std::string::npos)
@@ -40,14 +43,14 @@ struct fake {
             *out_reason = "mgmtd closed the session";
             return out->code != 1;
         };
-        return group_command(link, words);
+        return link;
     }
-    std::string sent(size_t commit) const {
+    std::string sent(size_t commit, const std::string &root = ROOT) const {
         static const char *const kinds[] = {"create", "modify", "remove", "reset"};
         std::string out;
         for (const ctl_change_item &item : commits.at(commit))
             out += std::string(kinds[static_cast<int>(item.change)]) + " " +
-                   item.binding.name.substr(ROOT.size()) + "=" + item.binding.value + ";";
+                   item.binding.name.substr(root.size()) + "=" + item.binding.value + ";";
         return out;
     }
 };
@@ -117,4 +120,84 @@ TEST(Groups, AsAWholeItIsOneCommitAsWell) {
         mgmtd.code = 1;
         EXPECT_EQ(mgmtd.run(words).exit, CTL_UNREACHABLE);
     }
+}
+
+// --- Redirected traffic
+
+static const std::string INTERCEPT = NODE_INTERCEPT_CONFIG "/51";
+using words = std::vector<std::string>;
+
+TEST(Intercepts, WrongClausesChangeNothingAndAreTold) {
+    const struct {
+        std::vector<std::string> words;
+        int exit;
+        const char *told;
+    } cases[] = {
+        {{"ad", "51"}, CTL_USAGE, "did you mean \"add\"?"},
+        {{"add", "51"}, CTL_USAGE, "intercept add GROUP"},
+        {{"set", "51"}, CTL_USAGE, "intercept add GROUP"},
+        {{"delete", "51", "to", "1"}, CTL_USAGE, "intercept add GROUP"},
+        {{"add", "5x", "all", "to", "3128"}, CTL_USAGE, "intercept add GROUP"},
+        {{"add", "51", "port", "80"}, CTL_USAGE, "\"to\" is missing"},
+        {{"add", "51", "to", "80"}, CTL_USAGE, "\"all\" is missing"},
+        {{"add", "51", "port", "to", "80"}, CTL_USAGE, "\"port\" needs a value"},
+        {{"add", "51", "port", "80", "all", "to", "1"}, CTL_USAGE, "exclude each other"},
+        {{"add", "51", "all", "port", "80", "to", "1"}, CTL_USAGE, "given twice"},
+        {{"add", "51", "port", "80", "tp", "3128"}, CTL_USAGE, "did you mean \"to\"?"},
+        {{"set", "51", "to", "none"}, CTL_USAGE, "\"to\" needs a value"},
+        {{"set", "51", "rise", "2", "rise", "3"}, CTL_USAGE, "given twice"},
+        {{"set", "51", "check", "htp", "/"}, CTL_USAGE, "did you mean \"http\"?"},
+        {{"set", "51", "check", "http", "rise", "2"}, CTL_USAGE, "needs the path of a page"},
+        {{"set", "51", "bypass"}, CTL_USAGE, "\"bypass\" needs a value"},
+        {{"set", "51", "rise", "2"}, CTL_NOT_FOUND, "no intercept for group 51"},
+    };
+    for (const auto &one : cases) {
+        fake mgmtd;
+        const traffic_result result = intercept_command(mgmtd.link(), one.words);
+        EXPECT_EQ(result.exit, one.exit) << one.told;
+        EXPECT_NE(result.error.find(one.told), std::string::npos) << result.error;
+        EXPECT_TRUE(mgmtd.commits.empty()) << one.told;
+    }
+}
+
+TEST(Intercepts, ClausesInAnyOrderAreOneCommit) {
+    fake mgmtd;
+    traffic_result result = intercept_command(
+        mgmtd.link(), {"add", "51", "leave", "0", "bypass", "10.0.0.0/8", "192.0.2.1", "check", "http", "/x",
+                       "to", "3128", "port", "443", "80", "port", "8000-8080", "bypass", "9.9.9.9"});
+    EXPECT_EQ(result.done, "added");
+    EXPECT_EQ(result.tunneld, "absent");
+    EXPECT_EQ(result.note, "");
+    EXPECT_EQ(mgmtd.sent(0, INTERCEPT),
+              "create =;create /bypass=9.9.9.9/32 10.0.0.0/8 192.0.2.1/32;create /check=http;create "
+              "/check_argument=/x;create /leave_after=0;create /ports=80 443 8000-8080;create /to=3128;");
+
+    // Only what is given, and differs.
+    for (const auto &[node, value] : std::map<std::string, std::string>{{"", "51"},
+                                                                        {"/to", "3128"},
+                                                                        {"/ports", "80 443"},
+                                                                        {"/check", "http"},
+                                                                        {"/check_argument", "/x"}})
+        mgmtd.nodes[INTERCEPT + node] = value;
+    const words unchanged = {"set", "51", "port", "443", "80", "rise", "2", "check", "http", "/x"};
+    EXPECT_EQ(intercept_command(mgmtd.link(), unchanged).done, "unchanged");
+    EXPECT_TRUE(mgmtd.commits.empty());
+    EXPECT_EQ(intercept_command(mgmtd.link(), {"set", "51", "check", "tcp", "all"}).done, "changed");
+    EXPECT_EQ(mgmtd.sent(0, INTERCEPT), "create /check=tcp;reset /check_argument=;create /ports=all;");
+    EXPECT_EQ(intercept_command(mgmtd.link(), {"add", "51", "all", "to", "1"}).exit, CTL_REFUSED);
+
+    // What is of no use is done, with a note.
+    mgmtd.nodes[ROOT + "/protocol"] = "17";
+    EXPECT_EQ(intercept_command(mgmtd.link(), {"set", "51", "to", "1"}).note,
+              "group 51 redirects 17, of which an intercept of tcp gets nothing");
+    EXPECT_EQ(intercept_command(mgmtd.link(), {"set", "51", "protocol", "udp"}).note, "");
+    EXPECT_EQ(intercept_command(mgmtd.link(), {"add", "052", "all", "to", "1"}).note,
+              "there is no group 52; it takes no part until there is");
+    mgmtd.code = LC_NOT_FOUND;
+    EXPECT_EQ(intercept_command(mgmtd.link(), {"delete", "52"}).exit, CTL_NOT_FOUND);
+    mgmtd.code = LC_BAD_ARGUMENT;
+    result = intercept_command(mgmtd.link(), {"set", "51", "to", "70000"});
+    EXPECT_EQ(result.exit, CTL_REFUSED);
+    EXPECT_EQ(result.error, "not like that");
+    EXPECT_EQ(result.done, "");
 }

@@ -113,27 +113,8 @@ static void tell_list(const ctl_options &options, const std::vector<listed_group
 
 static int run(const ctl_options &options, const std::vector<std::string> &words, const char *above,
                const char *kind,
-               group_result (*command)(const group_link &link, const std::vector<std::string> &words)) {
-    // Wrong words are reported without mgmtd as well.
-    struct closer {
-        ctl_session *session = nullptr;
-        ~closer() {
-            if (session)
-                ctl_close(session);
-        }
-    } held;
-    group_link link;
-    const auto open = [&](std::string *out_reason) {
-        if (!held.session)
-            held.session = ctl_open(options.timeout_ms, out_reason);
-        return held.session != nullptr;
-    };
-    link.query = [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
-        return open(out_reason) && ctl_query(held.session, walk, name, out, out_reason);
-    };
-    link.set = [&](const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *out_reason) {
-        return open(out_reason) && ctl_set(held.session, items, out, out_reason);
-    };
+               group_result (*command)(const ctl_link &link, const std::vector<std::string> &words)) {
+    const ctl_link link = link_to_mgmtd(options);
     if (words.size() == 1 && words[0] == "list") {
         std::vector<listed_group> groups;
         group_result result = list_groups(link, above, &groups);

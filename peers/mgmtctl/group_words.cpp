@@ -104,7 +104,7 @@ std::string parse_group_wish(const std::vector<std::string> &words, group_wish *
 std::string shell_quoted(const std::string &text) {
     if (!text.empty() &&
         text.find_first_not_of("abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789"
-                               "._-+:") == std::string::npos)
+                               "._-+:/") == std::string::npos)
         return text;
     std::string out = "'";
     for (const char c : text)

@@ -39,7 +39,7 @@ static std::string root_of(const char *above, long number) {
 }
 
 // False: there was no answer, or a refusal, which `inout` has.
-static bool ask(const group_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
+static bool ask(const ctl_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
                 group_result *inout) {
     std::string reason;
     if (!link.query(walk, name, out, &reason))
@@ -49,7 +49,7 @@ static bool ask(const group_link &link, ctl_walk walk, const std::string &name, 
     return inout->exit == CTL_OK;
 }
 
-static bool stands(const group_link &link, const std::string &root, group_result *inout, bool *out_stands) {
+static bool stands(const ctl_link &link, const std::string &root, group_result *inout, bool *out_stands) {
     ctl_reply reply;
     if (!ask(link, ctl_walk::node, root, &reply, inout))
         return false;
@@ -58,8 +58,7 @@ static bool stands(const group_link &link, const std::string &root, group_result
 }
 
 // What was set of a group, except for values that are the default.
-static bool read_group(const group_link &link, const std::string &root, group_nodes *out,
-                       group_result *inout) {
+static bool read_group(const ctl_link &link, const std::string &root, group_nodes *out, group_result *inout) {
     ctl_reply reply;
     if (!ask(link, ctl_walk::subtree, root, &reply, inout))
         return false;
@@ -103,7 +102,7 @@ static std::vector<ctl_change_item> creation(const std::string &root, const grou
 
 // --- Changes
 
-static bool commit(const group_link &link, const std::vector<ctl_change_item> &items, group_result *inout) {
+static bool commit(const ctl_link &link, const std::vector<ctl_change_item> &items, group_result *inout) {
     ctl_reply reply;
     std::string reason;
     if (!link.set(items, &reply, &reason)) {
@@ -119,7 +118,7 @@ static bool commit(const group_link &link, const std::vector<ctl_change_item> &i
 }
 
 // Looks at what wccpd has, until it has the group or hasn't it any more.
-static void settle(const group_link &link, bool wanted, group_result *inout) {
+static void settle(const ctl_link &link, bool wanted, group_result *inout) {
     using clock = std::chrono::steady_clock;
     const auto until = clock::now() + std::chrono::milliseconds(link.settle_ms);
     const std::string root = root_of(NODE_GROUP_STATE, inout->number);
@@ -158,7 +157,7 @@ static std::string what_it_lacks(const group_nodes &nodes) {
     return group_routers(nodes).empty() ? "without a router it takes no part" : "";
 }
 
-static void group_add(const group_link &link, const std::string &root, const group_wish &wish,
+static void group_add(const ctl_link &link, const std::string &root, const group_wish &wish,
                       group_result *inout) {
     bool there = false;
     if (!stands(link, root, inout, &there))
@@ -182,7 +181,7 @@ static void group_add(const group_link &link, const std::string &root, const gro
 }
 
 // Of a group that has to be there, what was set.
-static bool read_standing(const group_link &link, const std::string &root, group_nodes *out,
+static bool read_standing(const ctl_link &link, const std::string &root, group_nodes *out,
                           group_result *inout) {
     bool there = false;
     if (!stands(link, root, inout, &there))
@@ -194,7 +193,7 @@ static bool read_standing(const group_link &link, const std::string &root, group
     return read_group(link, root, out, inout);
 }
 
-static void group_restart(const group_link &link, const std::string &root, group_result *inout) {
+static void group_restart(const ctl_link &link, const std::string &root, group_result *inout) {
     group_nodes nodes;
     if (!read_standing(link, root, &nodes, inout))
         return;
@@ -222,7 +221,7 @@ static std::vector<ctl_change_item> router_changes(const std::string &root,
     return items;
 }
 
-static void group_set(const group_link &link, const std::string &root, const group_wish &wish,
+static void group_set(const ctl_link &link, const std::string &root, const group_wish &wish,
                       group_result *inout) {
     group_nodes before;
     if (!read_standing(link, root, &before, inout))
@@ -268,7 +267,7 @@ static void group_set(const group_link &link, const std::string &root, const gro
     settle(link, true, inout);
 }
 
-static void remove_root(const group_link &link, const std::string &root, group_result *inout) {
+static void remove_root(const ctl_link &link, const std::string &root, group_result *inout) {
     if (commit(link, {{ctl_change::remove, {root, "", ""}}}, inout))
         inout->done = "deleted";
     else if (inout->code == LC_NOT_FOUND)
@@ -280,7 +279,7 @@ static const char *const GROUP_USAGE =
     "group add N [WORD VALUE ...], group set N WORD VALUE ..., group restart "
     "N, group delete N; \"group words\" lists the words";
 
-group_result group_command(const group_link &link, const std::vector<std::string> &words) {
+group_result group_command(const ctl_link &link, const std::vector<std::string> &words) {
     group_result result;
     result.kind = "group";
     const std::string verb = words.empty() ? "" : words[0];
@@ -311,7 +310,7 @@ group_result group_command(const group_link &link, const std::vector<std::string
     return result;
 }
 
-group_result policy_command(const group_link &link, const std::vector<std::string> &words) {
+group_result policy_command(const ctl_link &link, const std::vector<std::string> &words) {
     static const char *const USAGE = "policy add N [name NAME], policy delete N";
     group_result result;
     result.kind = "policy group";
@@ -342,7 +341,7 @@ group_result policy_command(const group_link &link, const std::vector<std::strin
     return result;
 }
 
-group_result list_groups(const group_link &link, const std::string &above, std::vector<listed_group> *out) {
+group_result list_groups(const ctl_link &link, const std::string &above, std::vector<listed_group> *out) {
     group_result result;
     ctl_reply reply;
     if (!ask(link, ctl_walk::children, above, &reply, &result))

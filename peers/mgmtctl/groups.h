@@ -1,21 +1,11 @@
 // Changing groups and policy groups, apart from the session that carries the requests.
 #pragma once
 
-#include <functional>
 #include <map>
 #include <string>
 #include <vector>
 
-#include "peers/mgmtctl/commands.h"
-
-// Two requests of a session, so that a test can answer them.
-struct group_link {
-    std::function<bool(ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason)>
-        query;
-    std::function<bool(const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *out_reason)>
-        set;
-    int64_t settle_ms = 5000; // how long wccpd may take to follow
-};
+#include "peers/mgmtctl/link.h"
 
 struct group_result {
     int exit = CTL_OK;
@@ -32,8 +22,8 @@ struct group_result {
     bool designated = false;
 };
 
-group_result group_command(const group_link &link, const std::vector<std::string> &words);
-group_result policy_command(const group_link &link, const std::vector<std::string> &words);
+group_result group_command(const ctl_link &link, const std::vector<std::string> &words);
+group_result policy_command(const ctl_link &link, const std::vector<std::string> &words);
 
 // What was set of a group, by its names below the group's root; a value that is the default is left out.
 using group_nodes = std::map<std::string, std::string>;
@@ -44,4 +34,4 @@ struct listed_group {
     group_nodes nodes;
 };
 // All groups or policy groups below `above`.
-group_result list_groups(const group_link &link, const std::string &above, std::vector<listed_group> *out);
+group_result list_groups(const ctl_link &link, const std::string &above, std::vector<listed_group> *out);

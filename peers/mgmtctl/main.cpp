@@ -171,6 +171,12 @@ static void add_group_commands(command_line *line) {
     })->add_option("WORD", line->words);
 }
 
+static void add_traffic_commands(command_line *line) {
+    add_command(line, "intercept", "redirected packets to a proxy: add, set, delete, show, words", [line] {
+        return ctl_intercept(line->options, line->words);
+    })->add_option("WORD", line->words);
+}
+
 static void add_show_command(command_line *line) {
     ctl_options *options = &line->options;
     CLI::App *command = add_command(line, "show", "the whole appliance in one screen",
@@ -204,6 +210,7 @@ int main(int argc, char **argv) {
     add_node_commands(&line);
     add_watch_commands(&line);
     add_group_commands(&line);
+    add_traffic_commands(&line);
     add_show_command(&line);
     add_shell_command(&line);
 

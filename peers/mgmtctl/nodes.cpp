@@ -121,7 +121,8 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
 }
 
 static bool is_state(const node_name &name) {
-    for (const char *root : {NODE_WCCPD_STATE, NODE_GROUP_STATE, NODE_ALARM_STATE})
+    for (const char *root : {NODE_WCCPD_STATE, NODE_GROUP_STATE, NODE_PLANE_STATE, NODE_TUNNEL_STATE,
+                             NODE_INTERCEPT_STATE, NODE_ALARM_STATE})
         if (name == parsed_name(root) || name.is_under(parsed_name(root)))
             return true;
     return false;

@@ -15,3 +15,4 @@ std::vector<std::string> draw_screen(const snapshot &shown, const screen_form &f
 // One line for each group and alarm, without what changes by itself: a change shows in a comparison.
 std::vector<std::string> draw_lines(const snapshot &shown);
 std::string draw_json(const snapshot &shown);
+std::string duration_text(uint64_t milliseconds); // "3d 1:02:03"

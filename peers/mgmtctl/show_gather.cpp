@@ -12,7 +12,6 @@
 #include "peers/mgmtctl/show_gather.h"
 
 #include <algorithm>
-#include <charconv>
 
 #include <arpa/inet.h>
 
@@ -23,21 +22,6 @@
 #include "runtime/common.h"
 
 static constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
-
-template <typename Number>
-static Number number_of(const std::string &text, Number otherwise) {
-    Number out = otherwise;
-    (void)std::from_chars(text.data(), text.data() + text.size(), out);
-    return out;
-}
-
-// The parts of a name below `root`; none for a name that isn't below it.
-static std::vector<std::string> parts_below(const std::string &root, const std::string &name) {
-    node_name above, whole;
-    if (!parse_node_name(root, &above) || !parse_node_name(name, &whole) || !whole.is_under(above))
-        return {};
-    return {whole.parts.begin() + static_cast<std::ptrdiff_t>(above.parts.size()), whole.parts.end()};
-}
 
 namespace {
 struct gathering {

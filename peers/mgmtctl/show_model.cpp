@@ -2,6 +2,13 @@
 
 #include "peers/mgmtctl/nodes.h"
 
+std::vector<std::string> parts_below(const std::string &root, const std::string &name) {
+    node_name above, whole;
+    if (!parse_node_name(root, &above) || !parse_node_name(name, &whole) || !whole.is_under(above))
+        return {};
+    return {whole.parts.begin() + static_cast<std::ptrdiff_t>(above.parts.size()), whole.parts.end()};
+}
+
 std::string clean_text(const std::string &text, size_t most) {
     std::string out = text.substr(0, most);
     for (char &c : out)

@@ -2,6 +2,7 @@
 // (show_draw.h).
 #pragma once
 
+#include <charconv>
 #include <cstddef>
 #include <cstdint>
 #include <string>
@@ -73,6 +74,15 @@ struct snapshot {
     size_t alarms_total = 0;
 };
 
+// The number that the text begins with.
+template <typename Number>
+Number number_of(const std::string &text, Number otherwise) {
+    Number out = otherwise;
+    (void)std::from_chars(text.data(), text.data() + text.size(), out);
+    return out;
+}
+// The parts of a name below `root`; none for a name that isn't below it.
+std::vector<std::string> parts_below(const std::string &root, const std::string &name);
 // The text cut to `most` characters, everything but printable ASCII replaced.
 std::string clean_text(const std::string &text, size_t most);
 // The place of the appliance, which is added when it is new; -1 when there are too many.

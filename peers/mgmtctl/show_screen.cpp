@@ -68,7 +68,7 @@ static std::string format(const char *text, ...) {
     return buffer;
 }
 
-static std::string duration_text(uint64_t milliseconds) {
+std::string duration_text(uint64_t milliseconds) {
     const uint64_t seconds = milliseconds / 1000, days = seconds / 86400;
     const std::string days_text = days ? std::to_string(days) + "d " : "";
     return days_text + format("%" PRIu64 ":%02" PRIu64 ":%02" PRIu64, seconds / 3600 % 24, seconds / 60 % 60,

@@ -1,0 +1,177 @@
+// A command looks at what is there, makes one commit, and asks whether there is a tunneld to follow it. What
+// is no use without a group that fits is noted, and done all the same: the group may come later.
+#include "peers/mgmtctl/intercepts.h"
+
+#include <map>
+#include <optional>
+
+#include "mgmt/node_paths.h"
+#include "mgmt/protocol_names.h"
+#include "peers/mgmtctl/group_words.h"
+#include "peers/mgmtctl/intercept_words.h"
+#include "peers/mgmtctl/nodes.h"
+#include "runtime/common.h"
+
+static traffic_result failed(traffic_result result, int exit, const std::string &error, uint32_t code = 0) {
+    result.exit = exit;
+    result.error = error;
+    result.code = code;
+    result.done.clear();
+    return result;
+}
+
+static bool ask(const ctl_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
+                traffic_result *inout) {
+    std::string reason;
+    *out = {};
+    if (!link.query(walk, name, out, &reason))
+        *inout = failed(*inout, CTL_UNREACHABLE, reason);
+    else if (out->code != 0)
+        *inout = failed(*inout, CTL_REFUSED, out->message, out->code);
+    return inout->exit == CTL_OK;
+}
+
+// The node and what is below it, by the names below it, "" for the node itself.
+using node_texts = std::map<std::string, std::string>;
+static bool read_nodes(const ctl_link &link, const std::string &root, node_texts *out,
+                       traffic_result *inout) {
+    ctl_reply reply;
+    if (!ask(link, ctl_walk::subtree, root, &reply, inout))
+        return false;
+    for (const ctl_binding &binding : reply.bindings)
+        if (binding.name == root || binding.name.starts_with(root + "/"))
+            (*out)[binding.name == root ? "" : binding.name.substr(root.size() + 1)] = binding.value;
+    return true;
+}
+
+static void commit(const ctl_link &link, const std::vector<ctl_change_item> &items, const char *done,
+                   traffic_result *inout) {
+    ctl_reply reply;
+    std::string reason;
+    if (items.empty())
+        inout->done = "unchanged";
+    else if (!link.set(items, &reply, &reason))
+        *inout = failed(*inout, CTL_UNREACHABLE, reason);
+    else if (reply.code != 0)
+        *inout = failed(*inout, CTL_REFUSED, reply.message, reply.code);
+    else
+        inout->done = done;
+    if (inout->exit != CTL_OK)
+        return;
+    reply = {};
+    if (!link.query(ctl_walk::node, NODE_PLANE_STATE "/name", &reply, &reason))
+        return; // it is done all the same
+    inout->tunneld = reply.code == LC_IO_TIMED_OUT                   ? "silent"
+                     : reply.code != LC_OK || reply.bindings.empty() ? "absent"
+                                                                     : "running";
+}
+
+static void remove_root(const ctl_link &link, const std::string &root, const std::string &missing,
+                        traffic_result *inout) {
+    commit(link, {{ctl_change::remove, {root, "", ""}}}, "deleted", inout);
+    if (inout->code == LC_NOT_FOUND)
+        *inout = failed(*inout, CTL_NOT_FOUND, missing, inout->code);
+}
+
+// Nodes of something that is new, or those of it that differ.
+static std::vector<ctl_change_item> changes(const std::string &root, const intercept_wish &wish,
+                                            const node_texts &before) {
+    std::vector<ctl_change_item> items;
+    if (before.empty())
+        items.push_back({ctl_change::create, {root, "", ""}});
+    for (const auto &[node, value] : wish) {
+        const std::string name = std::string(root).append("/").append(node);
+        const schema_row *row = find_schema_row(parsed_name(name));
+        const auto old = before.find(node);
+        const auto fallback = row && row->fallback ? std::optional<std::string>(row->fallback) : std::nullopt;
+        const auto stood = old != before.end() ? std::optional(old->second) : fallback;
+        const auto wanted = value ? std::optional(kept_value(name, *value)) : fallback;
+        if (wanted == stood)
+            continue;
+        if (value)
+            items.push_back({ctl_change::create, {name, "", *wanted}});
+        else
+            items.push_back({ctl_change::reset, {name, "", ""}});
+    }
+    return items;
+}
+
+// --- Intercepts
+
+static int protocol_number(const std::string &text) {
+    const bool digits = !text.empty() && text.size() < 4 && text.find_first_not_of("0123456789") == text.npos;
+    return digits ? std::stoi(text) : ip_protocol_by_name(text.c_str());
+}
+
+// What mgmtd takes, and what is no use as the group is.
+static std::string what_does_not_fit(const ctl_link &link, const std::string &number,
+                                     const std::string &protocol) {
+    traffic_result unused;
+    node_texts group;
+    if (!read_nodes(link, std::string(NODE_GROUP_CONFIG "/") + number, &group, &unused))
+        return "";
+    if (group.empty())
+        return "there is no group " + number + "; it takes no part until there is";
+    const std::string redirected = group.contains("protocol") ? group["protocol"] : "tcp";
+    if (protocol_number(redirected) == protocol_number(protocol))
+        return "";
+    return "group " + number + " redirects " + redirected + ", of which an intercept of " + protocol +
+           " gets nothing";
+}
+
+static bool parse_group(const std::string &text, std::string *out) {
+    if (text.empty() || text.size() > 6 || text.find_first_not_of("0123456789") != std::string::npos)
+        return false;
+    *out = std::to_string(std::stol(text));
+    return true;
+}
+
+static void set_intercept(const ctl_link &link, const std::string &root, bool fresh,
+                          const intercept_wish &wish, traffic_result *inout) {
+    node_texts before;
+    if (!read_nodes(link, root, &before, inout))
+        return;
+    if (fresh != before.empty()) {
+        *inout = fresh ? failed(*inout, CTL_REFUSED,
+                                "there is an intercept for group " + inout->subject +
+                                    "; \"mgmtctl intercept set\" changes it")
+                       : failed(*inout, CTL_NOT_FOUND, "there is no intercept for group " + inout->subject);
+        return;
+    }
+    commit(link, changes(root, wish, before), fresh ? "added" : "changed", inout);
+    if (inout->exit != CTL_OK)
+        return;
+    std::string protocol = before.contains("protocol") ? before["protocol"] : "tcp";
+    if (const auto wanted = wish.find("protocol"); wanted != wish.end())
+        protocol = wanted->second.value_or("tcp");
+    inout->note = what_does_not_fit(link, inout->subject, protocol);
+}
+
+traffic_result intercept_command(const ctl_link &link, const std::vector<std::string> &words) {
+    static const char *const USAGE =
+        "intercept add GROUP {port N[-M] ... | all} to PORT [CLAUSE ...], intercept set GROUP CLAUSE ..., "
+        "intercept delete GROUP, intercept show [GROUP]; \"intercept words\" lists the clauses";
+    traffic_result result;
+    result.kind = "intercept";
+    const std::string verb = words.empty() ? "" : words[0];
+    if (verb != "add" && verb != "set" && verb != "delete")
+        return failed(result, CTL_USAGE,
+                      verb.empty() ? USAGE
+                                   : unknown_word_text(verb, {"add", "set", "delete", "show", "words"}));
+    if (words.size() < 2 || !parse_group(words[1], &result.subject) ||
+        (verb == "delete") != (words.size() == 2))
+        return failed(result, CTL_USAGE, USAGE);
+    intercept_wish wish;
+    if (const std::string wrong = parse_intercept_wish(words, &wish); !wrong.empty())
+        return failed(result, CTL_USAGE, wrong);
+    if (verb == "add" && (!wish.contains("ports") || !wish.contains("to")))
+        return failed(result, CTL_USAGE,
+                      wish.contains("ports") ? "\"to\" is missing: the port that the proxy listens on"
+                                             : "\"port\" or \"all\" is missing: what the proxy wants");
+    const std::string root = NODE_INTERCEPT_CONFIG "/" + result.subject;
+    if (verb == "delete")
+        remove_root(link, root, "there is no intercept for group " + result.subject, &result);
+    else
+        set_intercept(link, root, verb == "add", wish, &result);
+    return result;
+}

@@ -1,0 +1,21 @@
+// Changing what happens to redirected packets: intercepts, bypasses, and further sources of tunnels.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "peers/mgmtctl/link.h"
+
+struct traffic_result {
+    int exit = CTL_OK;
+    const char *kind = ""; // "intercept", "bypass", "source"
+    std::string subject;   // a group's number, a prefix, an address; empty: none was understood
+    std::string done;      // "added", "changed", "deleted", "unchanged"; empty: nothing
+    uint32_t code = 0;     // of mgmtd's refusal
+    std::string error;
+    std::string note;    // for a person, after what was done
+    std::string tunneld; // "running", "absent", "silent"; empty where it was not asked
+};
+
+// `words` follow "intercept", "bypass" and "tunnel". Each command is one commit.
+traffic_result intercept_command(const ctl_link &link, const std::vector<std::string> &words);

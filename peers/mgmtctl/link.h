@@ -1,0 +1,21 @@
+// What a command needs of a session, so that a test can give the answers.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "peers/mgmtctl/commands.h"
+
+struct ctl_link {
+    std::function<bool(ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason)>
+        query;
+    std::function<bool(const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *out_reason)>
+        set;
+    int64_t settle_ms = 5000; // how long wccpd may take to follow
+};
+
+// A link whose session begins with its first request and ends with the last copy: wrong words are reported
+// without mgmtd as well.
+ctl_link link_to_mgmtd(const ctl_options &options);

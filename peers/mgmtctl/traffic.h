@@ -1,0 +1,72 @@
+// What tunneld answers about redirected traffic, as "mgmtctl intercept show", "tunnel show" and "show" have
+// it.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "peers/mgmtctl/nodes.h"
+
+struct traffic_count {
+    uint64_t packets = 0, bytes = 0;
+};
+// What became of redirected packets, by the word for it: "in", "to_proxy", ...
+using sorted_counts = std::map<std::string, traffic_count>;
+using refused_counts = std::map<std::string, uint64_t>; // packets by the reason
+
+// All texts are cleaned: printable ASCII of bounded length.
+struct traffic_tunnel {
+    int id = 0;
+    std::string local, remote, interface;
+    uint32_t index = 0;
+    traffic_count in, out;
+    uint64_t fragments = 0;
+    refused_counts refused;
+    sorted_counts sorted;
+};
+struct traffic_intercept {
+    int group = 0;
+    std::string proxy, proxy_reason; // "up", "down", "unknown"; of the last failed check
+    uint64_t proxy_ms = 0;           // how long it has been that
+    bool active = true;              // no role keeps new flows from the proxy
+    bool left = false;               // the group is out of its routers
+    sorted_counts sorted;
+};
+enum class tunneld_condition { running, silent, absent };
+struct traffic_state {
+    tunneld_condition tunneld = tunneld_condition::absent; // unless it is running, nothing else is known
+    std::string plane, plane_reason;
+    uint64_t clamped = 0; // SYN-ACKs
+    refused_counts refused;
+    std::map<std::string, uint64_t> refused_sources; // packets by address
+    std::vector<traffic_tunnel> tunnels;             // by id
+    std::vector<traffic_intercept> intercepts;       // by group
+    std::map<int, std::string> left; // why a group is out of its routers, by group; mgmtd has it
+};
+
+// False: no answer.
+bool gather_traffic(const ctl_ask &ask, traffic_state *out);
+
+// The ways of sorting in the order in which they are shown.
+struct sorted_way {
+    const char *word, *shown;
+};
+const std::vector<sorted_way> &sorted_ways();
+// "in 120  to proxy 100  ...": packets, leaving out what is zero except for the first three.
+std::string sorted_text(const sorted_counts &counts);
+std::string proxy_text(const traffic_intercept &intercept);
+const char *tunneld_word(tunneld_condition condition); // "running", "silent", "absent"
+
+// Why traffic does not go where somebody would expect it to.
+struct traffic_reason {
+    std::string word; // "own_traffic", "refused_source", ...: does not change
+    int group;        // -1: of the whole appliance
+    std::string text; // one line, at most 76 characters
+};
+std::vector<traffic_reason> traffic_reasons(const traffic_state &state);
+
+// 12345 as "12345", from 100000 on as "123k", "4.5M".
+std::string count_text(uint64_t count);

@@ -1,0 +1,201 @@
+// "mgmtctl intercept", "bypass" and "tunnel": what a person and a script get to read.
+#include <cstdlib>
+#include <map>
+
+#include <nlohmann/json.hpp>
+
+#include "mgmt/bnode_types.h"
+#include "mgmt/node_paths.h"
+#include "peers/mgmtctl/group_words.h"
+#include "peers/mgmtctl/intercept_words.h"
+#include "peers/mgmtctl/intercepts.h"
+#include "peers/mgmtctl/render.h"
+#include "peers/mgmtctl/show_model.h"
+#include "peers/mgmtctl/traffic.h"
+
+// --- Changes
+
+static ctl_json as_json(const traffic_result &result) {
+    ctl_json subject = nullptr;
+    if (!result.subject.empty())
+        subject = std::string(result.kind) == "intercept" ? ctl_json(std::atol(result.subject.c_str()))
+                                                          : ctl_json(result.subject);
+    ctl_json out = {{result.kind, subject}, {"done", result.done.empty() ? "nothing" : result.done}};
+    if (!result.tunneld.empty())
+        out["tunneld"] = result.tunneld;
+    if (!result.note.empty())
+        out["note"] = result.note;
+    if (result.exit == CTL_OK)
+        return out;
+    out["error"] = result.error;
+    out["code"] = result.code;
+    out["exit"] = result.exit;
+    return out;
+}
+
+static int tell_result(const ctl_options &options, const traffic_result &result) {
+    const std::string subject = std::string(result.kind) + " " + result.subject;
+    if (options.json) {
+        put(json_line(as_json(result)));
+        return result.exit;
+    }
+    if (result.exit != CTL_OK)
+        return tell_failure(
+            options, {result.exit, result.subject.empty() ? "" : subject, result.error, "", result.code});
+    put(subject + " " + (result.done == "unchanged" ? "is as asked" : result.done) +
+        (result.note.empty() ? "" : " (" + result.note + ")") +
+        (result.tunneld == "absent"   ? "; tunneld is not running"
+         : result.tunneld == "silent" ? "; tunneld does not answer"
+                                      : "") +
+        "\n");
+    return result.exit;
+}
+
+// --- What is there
+
+namespace {
+// Walks of one command, which ends with the first failure.
+struct asking {
+    ctl_link link;
+    ctl_failure failure = {CTL_OK, "", "", "", 0};
+
+    bool ask(ctl_walk walk, const std::string &name, ctl_reply *out) {
+        *out = {};
+        if (!link.query(walk, name, out, &failure.error))
+            failure.exit = CTL_UNREACHABLE;
+        return failure.exit == CTL_OK;
+    }
+    bool ask_traffic(traffic_state *out) {
+        return gather_traffic([this](ctl_walk walk, const std::string &name,
+                                     ctl_reply *reply) { return ask(walk, name, reply); },
+                              out);
+    }
+    // What is configured below `root`: the nodes of each instance by its name.
+    bool ask_configuration(const char *root,
+                           std::vector<std::pair<std::string, std::map<std::string, std::string>>> *out) {
+        ctl_reply reply;
+        if (!ask(ctl_walk::subtree, root, &reply))
+            return false;
+        if (reply.code != 0)
+            failure = {exit_of(reply.code), root, reply.message, "", reply.code};
+        for (const ctl_binding &binding : reply.bindings) {
+            const std::vector<std::string> parts = parts_below(root, binding.name);
+            if (parts.empty() || parts.size() > 2)
+                continue;
+            if (out->empty() || out->back().first != parts[0])
+                out->push_back({parts[0], {}});
+            if (parts.size() == 2)
+                out->back().second[parts[1]] = binding.value;
+        }
+        return failure.exit == CTL_OK;
+    }
+};
+} // namespace
+
+static ctl_json sorted_json(const sorted_counts &counts) {
+    ctl_json out = ctl_json::object();
+    for (const sorted_way &way : sorted_ways())
+        if (const auto found = counts.find(way.word); found != counts.end())
+            out[way.word] = {{"packets", found->second.packets}, {"bytes", found->second.bytes}};
+    return out;
+}
+
+static ctl_json text_or_null(const std::string &text) {
+    return text.empty() ? ctl_json(nullptr) : ctl_json(text);
+}
+
+static void put_absence(tunneld_condition condition) {
+    if (condition != tunneld_condition::running)
+        put(condition == tunneld_condition::absent ? "tunneld is not running\n"
+                                                   : "tunneld does not answer\n");
+}
+
+static void put_reasons(const std::vector<traffic_reason> &reasons, int group) {
+    for (const traffic_reason &reason : reasons)
+        if (reason.group == group)
+            put("  " + reason.text + "\n");
+}
+
+// --- Intercepts
+
+static ctl_json intercept_json(const std::string &number, const std::map<std::string, std::string> &nodes,
+                               const traffic_intercept *state, const traffic_state &traffic) {
+    ctl_json out = {{"group", std::atol(number.c_str())}};
+    for (const intercept_word &word : intercept_words()) {
+        const auto found = nodes.find(word.node);
+        const schema_row *row =
+            find_schema_row(parsed_name(NODE_INTERCEPT_CONFIG "/0/" + std::string(word.node)));
+        if (found != nodes.end() && row)
+            out[word.node] = bn_type_numeric(row->type) ? ctl_json(std::atol(found->second.c_str()))
+                                                        : ctl_json(found->second);
+        else
+            out[word.node] = nullptr;
+    }
+    const auto argument = nodes.find("check_argument");
+    out["check_argument"] = text_or_null(argument == nodes.end() ? "" : argument->second);
+    out["proxy"] = text_or_null(state ? state->proxy : "");
+    out["proxy_reason"] = text_or_null(state ? state->proxy_reason : "");
+    out["proxy_ms"] = state ? ctl_json(state->proxy_ms) : ctl_json(nullptr);
+    out["active"] = state ? ctl_json(state->active) : ctl_json(nullptr);
+    const auto left = traffic.left.find(std::atoi(number.c_str()));
+    out["left"] = state ? ctl_json(state->left) : ctl_json(nullptr);
+    out["left_reason"] = text_or_null(left == traffic.left.end() ? "" : left->second);
+    out["packets"] = state ? sorted_json(state->sorted) : ctl_json(nullptr);
+    return out;
+}
+
+static int show_intercepts(const ctl_options &options, const std::string &only) {
+    asking mgmtd = {link_to_mgmtd(options)};
+    std::vector<std::pair<std::string, std::map<std::string, std::string>>> intercepts;
+    traffic_state traffic;
+    if (!mgmtd.ask_configuration(NODE_INTERCEPT_CONFIG, &intercepts) || !mgmtd.ask_traffic(&traffic))
+        return tell_failure(options, mgmtd.failure);
+    std::erase_if(intercepts, [&](const auto &each) { return !only.empty() && each.first != only; });
+    if (!only.empty() && intercepts.empty())
+        return tell_failure(options, {CTL_NOT_FOUND, "", "there is no intercept for group " + only, "", 0});
+    const std::vector<traffic_reason> reasons = traffic_reasons(traffic);
+    ctl_json all = ctl_json::array();
+    for (const auto &[number, nodes] : intercepts) {
+        const traffic_intercept *state = nullptr;
+        for (const traffic_intercept &each : traffic.intercepts)
+            if (std::to_string(each.group) == number)
+                state = &each;
+        all.push_back(intercept_json(number, nodes, state, traffic));
+        if (options.json)
+            continue;
+        put(number + " " + intercept_clauses(nodes) + "\n");
+        if (state)
+            put("  " + proxy_text(*state) + "\n  " + sorted_text(state->sorted) + "\n");
+        put_reasons(reasons, std::atoi(number.c_str()));
+    }
+    if (options.json)
+        put(json_line({{"tunneld", tunneld_word(traffic.tunneld)}, {"intercepts", all}}));
+    else
+        put_absence(traffic.tunneld);
+    return CTL_OK;
+}
+
+static int list_clauses(const ctl_options &options) {
+    ctl_json all = ctl_json::array();
+    for (const intercept_word &word : intercept_words()) {
+        const char *fallback = intercept_word_fallback(word);
+        if (!options.json)
+            put(word.word + std::string(10 - std::string(word.word).size(), ' ') + word.values +
+                (fallback && *fallback ? std::string("; default ") + fallback : "") + "\n");
+        all.push_back({{"word", word.word},
+                       {"node", word.node},
+                       {"values", word.values},
+                       {"default", fallback ? ctl_json(fallback) : ctl_json(nullptr)}});
+    }
+    if (options.json)
+        put(json_line(all));
+    return CTL_OK;
+}
+
+int ctl_intercept(const ctl_options &options, const std::vector<std::string> &words) {
+    if (!words.empty() && words[0] == "show" && words.size() <= 2)
+        return show_intercepts(options, words.size() == 2 ? words[1] : "");
+    if (words.size() == 1 && words[0] == "words")
+        return list_clauses(options);
+    return tell_result(options, intercept_command(link_to_mgmtd(options), words));
+}
