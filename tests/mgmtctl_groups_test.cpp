@@ -201,3 +201,40 @@ TEST(Intercepts, ClausesInAnyOrderAreOneCommit) {
     EXPECT_EQ(result.error, "not like that");
     EXPECT_EQ(result.done, "");
 }
+
+TEST(Bypasses, HaveOneNameAndEndByThemselves) {
+    fake mgmtd;
+    const struct {
+        words said;
+        bool done;
+        const char *told; // the error, or what is sent
+    } cases[] = {
+        {{"add", "10.0.0.0/08"}, true, "create /10.0.0.0\\/8=;"},
+        {{"add", "192.0.2.1", "for", "60"},
+         true,
+         "create /192.0.2.1\\/32=;create /192.0.2.1\\/32/until=1060;"},
+        {{"add", "10.0.0.1/8"}, false, "host bits"},
+        {{"add", "10.0.0"}, false, "is no IPv4 prefix"},
+        {{"add", "10.0.0.0/8", "fro", "60"}, false, "did you mean \"for\"?"},
+        {{"add", "10.0.0.0/8", "for", "0"}, false, "number of seconds"},
+        {{"add", "10.0.0.0/8", "for", "4294967296"}, false, "number of seconds"},
+        {{"add", "10.0.0.0/8", "for"}, false, "bypass add PREFIX"},
+        {{"delete", "10.0.0.0/8", "for", "1"}, false, "bypass add PREFIX"},
+    };
+    for (const auto &one : cases) {
+        const traffic_result result = bypass_command(mgmtd.link(), one.said, 1000);
+        EXPECT_EQ(result.exit, one.done ? CTL_OK : CTL_USAGE) << result.error;
+        ASSERT_EQ(mgmtd.commits.size(), one.done ? 1u : 0u) << result.error;
+        const std::string told = one.done ? mgmtd.sent(0, NODE_BYPASS_CONFIG) : result.error;
+        EXPECT_NE(told.find(one.told), std::string::npos) << told;
+    }
+    // One that is there gets the new time, and those whose time is over go.
+    for (const char *name : {"/10.0.0.0\\/8", "/9.0.0.0\\/8", "/8.0.0.0\\/8"})
+        mgmtd.nodes[std::string(NODE_BYPASS_CONFIG) + name] = name + 1;
+    mgmtd.nodes[NODE_BYPASS_CONFIG "/9.0.0.0\\/8/until"] = "1000";
+    mgmtd.nodes[NODE_BYPASS_CONFIG "/8.0.0.0\\/8/until"] = "0";
+    EXPECT_EQ(bypass_command(mgmtd.link(), {"add", "10.0.0.0/8", "for", "5"}, 1000).done, "changed");
+    ASSERT_EQ(mgmtd.commits.size(), 2u);
+    EXPECT_EQ(mgmtd.sent(0, NODE_BYPASS_CONFIG), "create /10.0.0.0\\/8/until=1005;");
+    EXPECT_EQ(mgmtd.sent(1, NODE_BYPASS_CONFIG), "remove /9.0.0.0\\/8=;");
+}

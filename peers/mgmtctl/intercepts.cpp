@@ -2,6 +2,7 @@
 // is no use without a group that fits is noted, and done all the same: the group may come later.
 #include "peers/mgmtctl/intercepts.h"
 
+#include <cstdlib>
 #include <map>
 #include <optional>
 
@@ -10,6 +11,8 @@
 #include "peers/mgmtctl/group_words.h"
 #include "peers/mgmtctl/intercept_words.h"
 #include "peers/mgmtctl/nodes.h"
+#include "peers/mgmtctl/show_model.h"
+#include "peers/nodes/value_lists.h"
 #include "runtime/common.h"
 
 static traffic_result failed(traffic_result result, int exit, const std::string &error, uint32_t code = 0) {
@@ -173,5 +176,65 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
         remove_root(link, root, "there is no intercept for group " + result.subject, &result);
     else
         set_intercept(link, root, verb == "add", wish, &result);
+    return result;
+}
+
+// --- Bypasses
+
+static std::string instance_name(const char *above, const std::string &part) {
+    return parsed_name(above).below(part).text();
+}
+
+// Somebody else may delete them at the same time.
+static void delete_ended(const ctl_link &link, int64_t now) {
+    traffic_result unused;
+    node_texts nodes;
+    std::vector<ctl_change_item> items;
+    if (!read_nodes(link, NODE_BYPASS_CONFIG, &nodes, &unused))
+        return;
+    for (const auto &[name, value] : nodes)
+        if (name.ends_with("/until") && value != "0" && std::atoll(value.c_str()) <= now)
+            items.push_back(
+                {ctl_change::remove, {NODE_BYPASS_CONFIG "/" + name.substr(0, name.rfind('/')), "", ""}});
+    ctl_reply reply;
+    std::string reason;
+    if (!items.empty())
+        (void)link.set(items, &reply, &reason);
+}
+
+traffic_result bypass_command(const ctl_link &link, const std::vector<std::string> &words, int64_t now) {
+    static const char *const USAGE = "bypass add PREFIX [for SECONDS], bypass delete PREFIX, bypass show";
+    traffic_result result;
+    result.kind = "bypass";
+    const std::string verb = words.empty() ? "" : words[0];
+    if (verb != "add" && verb != "delete")
+        return failed(result, CTL_USAGE,
+                      verb.empty() ? USAGE : unknown_word_text(verb, {"add", "delete", "show"}));
+    if (words.size() != 2 && (verb == "delete" || words.size() != 4))
+        return failed(result, CTL_USAGE, USAGE);
+    result.subject = words[1].find('/') == std::string::npos ? words[1] + "/32" : words[1];
+    if (const char *wrong = check_prefix(&result.subject))
+        return failed(result, CTL_USAGE, wrong);
+    const std::string root = instance_name(NODE_BYPASS_CONFIG, result.subject);
+    if (verb == "delete") {
+        remove_root(link, root, "there is no such bypass", &result);
+        return result;
+    }
+    int64_t until = 0;
+    if (words.size() == 4) {
+        if (words[2] != "for")
+            return failed(result, CTL_USAGE, unknown_word_text(words[2], {"for"}));
+        const int64_t seconds = number_of<int64_t>(words[3], 0);
+        if (std::to_string(seconds) != words[3] || seconds < 1 || now + seconds > UINT32_MAX)
+            return failed(result, CTL_USAGE, "\"for\" needs a number of seconds");
+        until = now + seconds;
+    }
+    node_texts before;
+    if (!read_nodes(link, root, &before, &result))
+        return result;
+    commit(link, changes(root, {{"until", std::to_string(until)}}, before),
+           before.empty() ? "added" : "changed", &result);
+    if (result.exit == CTL_OK)
+        delete_ended(link, now);
     return result;
 }

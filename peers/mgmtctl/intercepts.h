@@ -1,6 +1,7 @@
 // Changing what happens to redirected packets: intercepts, bypasses, and further sources of tunnels.
 #pragma once
 
+#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -19,3 +20,6 @@ struct traffic_result {
 
 // `words` follow "intercept", "bypass" and "tunnel". Each command is one commit.
 traffic_result intercept_command(const ctl_link &link, const std::vector<std::string> &words);
+// `now` in seconds since 1970. Bypasses whose time is over are deleted along with an "add", in a commit of
+// their own that may fail.
+traffic_result bypass_command(const ctl_link &link, const std::vector<std::string> &words, int64_t now);

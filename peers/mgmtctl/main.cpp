@@ -175,6 +175,9 @@ static void add_traffic_commands(command_line *line) {
     add_command(line, "intercept", "redirected packets to a proxy: add, set, delete, show, words", [line] {
         return ctl_intercept(line->options, line->words);
     })->add_option("WORD", line->words);
+    add_command(line, "bypass", "clients and servers that are left alone: add, delete, show", [line] {
+        return ctl_bypass(line->options, line->words);
+    })->add_option("WORD", line->words);
 }
 
 static void add_show_command(command_line *line) {

@@ -1,5 +1,6 @@
 // "mgmtctl intercept", "bypass" and "tunnel": what a person and a script get to read.
 #include <cstdlib>
+#include <ctime>
 #include <map>
 
 #include <nlohmann/json.hpp>
@@ -198,4 +199,38 @@ int ctl_intercept(const ctl_options &options, const std::vector<std::string> &wo
     if (words.size() == 1 && words[0] == "words")
         return list_clauses(options);
     return tell_result(options, intercept_command(link_to_mgmtd(options), words));
+}
+
+// --- Bypasses
+
+static int show_bypasses(const ctl_options &options) {
+    asking mgmtd = {link_to_mgmtd(options)};
+    std::vector<std::pair<std::string, std::map<std::string, std::string>>> bypasses;
+    traffic_state traffic;
+    if (!mgmtd.ask_configuration(NODE_BYPASS_CONFIG, &bypasses) || !mgmtd.ask_traffic(&traffic))
+        return tell_failure(options, mgmtd.failure);
+    ctl_json all = ctl_json::array();
+    for (const auto &[prefix, nodes] : bypasses) {
+        const auto found = nodes.find("until");
+        const int64_t until = found == nodes.end() ? 0 : std::atoll(found->second.c_str());
+        const int64_t left = until - time(nullptr);
+        if (!options.json)
+            put(prefix +
+                (until == 0  ? ""
+                 : left <= 0 ? "  is over"
+                             : "  for " + std::to_string(left) + " s more") +
+                "\n");
+        all.push_back({{"prefix", prefix}, {"until", until ? ctl_json(until) : ctl_json(nullptr)}});
+    }
+    if (options.json)
+        put(json_line({{"tunneld", tunneld_word(traffic.tunneld)}, {"bypasses", all}}));
+    else
+        put_absence(traffic.tunneld);
+    return CTL_OK;
+}
+
+int ctl_bypass(const ctl_options &options, const std::vector<std::string> &words) {
+    if (words.size() == 1 && words[0] == "show")
+        return show_bypasses(options);
+    return tell_result(options, bypass_command(link_to_mgmtd(options), words, time(nullptr)));
 }
