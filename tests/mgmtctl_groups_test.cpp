@@ -238,3 +238,31 @@ TEST(Bypasses, HaveOneNameAndEndByThemselves) {
     EXPECT_EQ(mgmtd.sent(0, NODE_BYPASS_CONFIG), "create /10.0.0.0\\/8/until=1005;");
     EXPECT_EQ(mgmtd.sent(1, NODE_BYPASS_CONFIG), "remove /9.0.0.0\\/8=;");
 }
+
+TEST(Tunnels, FurtherSourcesAreAcceptedAndTakenBack) {
+    fake mgmtd;
+    const struct {
+        words said;
+        const char *done, *told; // the error, or what is sent
+    } cases[] = {
+        {{"accept", "10.0.0.9"}, "accepted", "create =;"},
+        {{"accept", "10.0.0.9", "router", "10.0.0.1"}, "accepted", "create =;create /router=10.0.0.1;"},
+        {{"accept", "10.0.0.8"}, "changed", "reset /router=;"},
+        {{"accept", "10.0.0.8", "router", "10.0.0.1"}, "unchanged", ""},
+        {{"refuse", "10.0.0.9"}, "refused", "remove =;"},
+        {{"acept", "10.0.0.9"}, "", "did you mean \"accept\"?"},
+        {{"accept", "10.0.0"}, "", "\"10.0.0\" is no IPv4 address"},
+        {{"accept", "127.0.0.1"}, "", "is not the address of another host"},
+        {{"accept", "10.0.0.9", "for", "9"}, "", "known are router"},
+        {{"refuse", "10.0.0.9", "router", "10.0.0.1"}, "", "tunnel accept ADDRESS"},
+    };
+    mgmtd.nodes[NODE_ACCEPT_CONFIG "/10.0.0.8"] = "10.0.0.8";
+    mgmtd.nodes[NODE_ACCEPT_CONFIG "/10.0.0.8/router"] = "10.0.0.1";
+    for (const auto &one : cases) {
+        const traffic_result result = tunnel_command(mgmtd.link(), one.said);
+        EXPECT_EQ(result.done, one.done) << result.error;
+        const std::string told =
+            mgmtd.commits.empty() ? result.error : mgmtd.sent(0, NODE_ACCEPT_CONFIG "/10.0.0.9");
+        EXPECT_NE(told.find(one.told), std::string::npos) << told;
+    }
+}

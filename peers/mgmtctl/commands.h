@@ -48,6 +48,7 @@ int ctl_policy(const ctl_options &options, const std::vector<std::string> &words
 // What happens to redirected packets (traffic_cli.cpp): "intercept add 51 port 80 to 3128".
 int ctl_intercept(const ctl_options &options, const std::vector<std::string> &words);
 int ctl_bypass(const ctl_options &options, const std::vector<std::string> &words);
+int ctl_tunnel(const ctl_options &options, const std::vector<std::string> &words);
 
 // The whole appliance (show.cpp).
 int ctl_show(const ctl_options &options);

@@ -69,9 +69,9 @@ static void commit(const ctl_link &link, const std::vector<ctl_change_item> &ite
                                                                      : "running";
 }
 
-static void remove_root(const ctl_link &link, const std::string &root, const std::string &missing,
-                        traffic_result *inout) {
-    commit(link, {{ctl_change::remove, {root, "", ""}}}, "deleted", inout);
+static void remove_root(const ctl_link &link, const std::string &root, const char *done,
+                        const std::string &missing, traffic_result *inout) {
+    commit(link, {{ctl_change::remove, {root, "", ""}}}, done, inout);
     if (inout->code == LC_NOT_FOUND)
         *inout = failed(*inout, CTL_NOT_FOUND, missing, inout->code);
 }
@@ -173,7 +173,7 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
                                              : "\"port\" or \"all\" is missing: what the proxy wants");
     const std::string root = NODE_INTERCEPT_CONFIG "/" + result.subject;
     if (verb == "delete")
-        remove_root(link, root, "there is no intercept for group " + result.subject, &result);
+        remove_root(link, root, "deleted", "there is no intercept for group " + result.subject, &result);
     else
         set_intercept(link, root, verb == "add", wish, &result);
     return result;
@@ -214,10 +214,10 @@ traffic_result bypass_command(const ctl_link &link, const std::vector<std::strin
         return failed(result, CTL_USAGE, USAGE);
     result.subject = words[1].find('/') == std::string::npos ? words[1] + "/32" : words[1];
     if (const char *wrong = check_prefix(&result.subject))
-        return failed(result, CTL_USAGE, wrong);
+        return failed(result, CTL_USAGE, wrong); // after the kind and the subject
     const std::string root = instance_name(NODE_BYPASS_CONFIG, result.subject);
     if (verb == "delete") {
-        remove_root(link, root, "there is no such bypass", &result);
+        remove_root(link, root, "deleted", "there is no such bypass", &result);
         return result;
     }
     int64_t until = 0;
@@ -236,5 +236,38 @@ traffic_result bypass_command(const ctl_link &link, const std::vector<std::strin
            before.empty() ? "added" : "changed", &result);
     if (result.exit == CTL_OK)
         delete_ended(link, now);
+    return result;
+}
+
+// --- Further sources of tunnels
+
+traffic_result tunnel_command(const ctl_link &link, const std::vector<std::string> &words) {
+    static const char *const USAGE =
+        "tunnel accept ADDRESS [router ADDRESS], tunnel refuse ADDRESS, tunnel show";
+    traffic_result result;
+    result.kind = "source";
+    const std::string verb = words.empty() ? "" : words[0];
+    if (verb != "accept" && verb != "refuse")
+        return failed(result, CTL_USAGE,
+                      verb.empty() ? USAGE : unknown_word_text(verb, {"accept", "refuse", "show"}));
+    if (words.size() != 2 && (verb == "refuse" || words.size() != 4))
+        return failed(result, CTL_USAGE, USAGE);
+    if (words.size() == 4 && words[2] != "router")
+        return failed(result, CTL_USAGE, unknown_word_text(words[2], {"router"}));
+    std::string address = words[1];
+    if (const char *wrong = check_host_address(&address))
+        return failed(result, CTL_USAGE, "\"" + words[1] + "\" " + wrong);
+    result.subject = address;
+    const std::string root = instance_name(NODE_ACCEPT_CONFIG, address);
+    if (verb == "refuse") {
+        remove_root(link, root, "refused", "is not accepted beside the routers", &result);
+        return result;
+    }
+    node_texts before;
+    if (!read_nodes(link, root, &before, &result))
+        return result;
+    const std::optional<std::string> router = words.size() == 4 ? std::optional(words[3]) : std::nullopt;
+    commit(link, changes(root, {{"router", router}}, before), before.empty() ? "accepted" : "changed",
+           &result);
     return result;
 }

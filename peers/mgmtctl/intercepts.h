@@ -11,8 +11,8 @@ struct traffic_result {
     int exit = CTL_OK;
     const char *kind = ""; // "intercept", "bypass", "source"
     std::string subject;   // a group's number, a prefix, an address; empty: none was understood
-    std::string done;      // "added", "changed", "deleted", "unchanged"; empty: nothing
-    uint32_t code = 0;     // of mgmtd's refusal
+    std::string done;  // "added", "accepted", "changed", "deleted", "refused", "unchanged"; empty: nothing
+    uint32_t code = 0; // of mgmtd's refusal
     std::string error;
     std::string note;    // for a person, after what was done
     std::string tunneld; // "running", "absent", "silent"; empty where it was not asked
@@ -23,3 +23,9 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
 // `now` in seconds since 1970. Bypasses whose time is over are deleted along with an "add", in a commit of
 // their own that may fail.
 traffic_result bypass_command(const ctl_link &link, const std::vector<std::string> &words, int64_t now);
+traffic_result tunnel_command(const ctl_link &link, const std::vector<std::string> &words);
+
+// What is configured and what tunneld answers, printed. They give the exit code.
+int tell_intercepts(const ctl_options &options, const ctl_link &link, const std::string &only);
+int tell_bypasses(const ctl_options &options, const ctl_link &link);
+int tell_tunnels(const ctl_options &options, const ctl_link &link);

@@ -178,6 +178,9 @@ static void add_traffic_commands(command_line *line) {
     add_command(line, "bypass", "clients and servers that are left alone: add, delete, show", [line] {
         return ctl_bypass(line->options, line->words);
     })->add_option("WORD", line->words);
+    add_command(line, "tunnel", "tunnels and who may send into them: accept, refuse, show", [line] {
+        return ctl_tunnel(line->options, line->words);
+    })->add_option("WORD", line->words);
 }
 
 static void add_show_command(command_line *line) {

@@ -145,8 +145,8 @@ static ctl_json intercept_json(const std::string &number, const std::map<std::st
     return out;
 }
 
-static int show_intercepts(const ctl_options &options, const std::string &only) {
-    asking mgmtd = {link_to_mgmtd(options)};
+int tell_intercepts(const ctl_options &options, const ctl_link &link, const std::string &only) {
+    asking mgmtd = {link};
     std::vector<std::pair<std::string, std::map<std::string, std::string>>> intercepts;
     traffic_state traffic;
     if (!mgmtd.ask_configuration(NODE_INTERCEPT_CONFIG, &intercepts) || !mgmtd.ask_traffic(&traffic))
@@ -195,7 +195,7 @@ static int list_clauses(const ctl_options &options) {
 
 int ctl_intercept(const ctl_options &options, const std::vector<std::string> &words) {
     if (!words.empty() && words[0] == "show" && words.size() <= 2)
-        return show_intercepts(options, words.size() == 2 ? words[1] : "");
+        return tell_intercepts(options, link_to_mgmtd(options), words.size() == 2 ? words[1] : "");
     if (words.size() == 1 && words[0] == "words")
         return list_clauses(options);
     return tell_result(options, intercept_command(link_to_mgmtd(options), words));
@@ -203,8 +203,8 @@ int ctl_intercept(const ctl_options &options, const std::vector<std::string> &wo
 
 // --- Bypasses
 
-static int show_bypasses(const ctl_options &options) {
-    asking mgmtd = {link_to_mgmtd(options)};
+int tell_bypasses(const ctl_options &options, const ctl_link &link) {
+    asking mgmtd = {link};
     std::vector<std::pair<std::string, std::map<std::string, std::string>>> bypasses;
     traffic_state traffic;
     if (!mgmtd.ask_configuration(NODE_BYPASS_CONFIG, &bypasses) || !mgmtd.ask_traffic(&traffic))
@@ -231,6 +231,92 @@ static int show_bypasses(const ctl_options &options) {
 
 int ctl_bypass(const ctl_options &options, const std::vector<std::string> &words) {
     if (words.size() == 1 && words[0] == "show")
-        return show_bypasses(options);
+        return tell_bypasses(options, link_to_mgmtd(options));
     return tell_result(options, bypass_command(link_to_mgmtd(options), words, time(nullptr)));
+}
+
+// --- Tunnels
+
+static ctl_json tunnel_json(const traffic_tunnel &tunnel) {
+    return {{"id", tunnel.id},
+            {"local", tunnel.local},
+            {"remote", tunnel.remote},
+            {"interface", text_or_null(tunnel.interface)},
+            {"index", tunnel.index},
+            {"in", {{"packets", tunnel.in.packets}, {"bytes", tunnel.in.bytes}}},
+            {"out", {{"packets", tunnel.out.packets}, {"bytes", tunnel.out.bytes}}},
+            {"fragments", tunnel.fragments},
+            {"refused", tunnel.refused},
+            {"sorted", sorted_json(tunnel.sorted)}};
+}
+
+static std::string refused_text(const refused_counts &refused) {
+    std::string out;
+    for (const auto &[reason, packets] : refused)
+        if (packets > 0)
+            out += "  " + reason + " " + count_text(packets);
+    return out.empty() ? "" : "  refused by reason:" + out + "\n";
+}
+
+static std::string count_of_bytes(const traffic_count &count) {
+    return count_text(count.packets) + " (" + count_text(count.bytes) + " bytes)";
+}
+
+static void put_tunnels(const traffic_state &traffic) {
+    put("data plane " + traffic.plane + (traffic.plane_reason.empty() ? "" : ": " + traffic.plane_reason) +
+        "\n" + refused_text(traffic.refused));
+    for (const traffic_tunnel &tunnel : traffic.tunnels)
+        put("tunnel " + std::to_string(tunnel.id) + "  " + tunnel.local + " to " + tunnel.remote +
+            (tunnel.interface.empty() ? "" : "  on " + tunnel.interface) + "  index " +
+            std::to_string(tunnel.index) + "\n  in " + count_of_bytes(tunnel.in) + "  out " +
+            count_of_bytes(tunnel.out) + "  fragments " + count_text(tunnel.fragments) +
+            "\n  sorted: " + sorted_text(tunnel.sorted) + "\n" + refused_text(tunnel.refused));
+}
+
+int tell_tunnels(const ctl_options &options, const ctl_link &link) {
+    asking mgmtd = {link};
+    std::vector<std::pair<std::string, std::map<std::string, std::string>>> accepted;
+    traffic_state traffic;
+    if (!mgmtd.ask_configuration(NODE_ACCEPT_CONFIG, &accepted) || !mgmtd.ask_traffic(&traffic))
+        return tell_failure(options, mgmtd.failure);
+    const std::vector<traffic_reason> reasons = traffic_reasons(traffic);
+    const bool running = traffic.tunneld == tunneld_condition::running;
+    ctl_json out = {{"tunneld", tunneld_word(traffic.tunneld)},
+                    {"plane", text_or_null(traffic.plane)},
+                    {"plane_reason", text_or_null(traffic.plane_reason)},
+                    {"clamped", running ? ctl_json(traffic.clamped) : ctl_json(nullptr)},
+                    {"refused", traffic.refused},
+                    {"refused_sources", traffic.refused_sources},
+                    {"tunnels", ctl_json::array()},
+                    {"accepted", ctl_json::array()},
+                    {"reasons", ctl_json::array()}};
+    for (const traffic_tunnel &tunnel : traffic.tunnels)
+        out["tunnels"].push_back(tunnel_json(tunnel));
+    if (!options.json && running)
+        put_tunnels(traffic);
+    for (const auto &[address, nodes] : accepted) {
+        const auto found = nodes.find("router");
+        const std::string router = found == nodes.end() || found->second == "0.0.0.0" ? "" : found->second;
+        out["accepted"].push_back({{"address", address}, {"router", text_or_null(router)}});
+        if (!options.json)
+            put("accepted " + address + (router.empty() ? "" : " beside router " + router) + "\n");
+    }
+    for (const traffic_reason &reason : reasons) {
+        if (reason.group >= 0)
+            continue;
+        out["reasons"].push_back({{"reason", reason.word}, {"text", reason.text}});
+        if (!options.json)
+            put(reason.text + "\n");
+    }
+    if (options.json)
+        put(json_line(out));
+    else
+        put_absence(traffic.tunneld);
+    return running ? CTL_OK : CTL_UNREACHABLE;
+}
+
+int ctl_tunnel(const ctl_options &options, const std::vector<std::string> &words) {
+    if (words.size() == 1 && words[0] == "show")
+        return tell_tunnels(options, link_to_mgmtd(options));
+    return tell_result(options, tunnel_command(link_to_mgmtd(options), words));
 }
