@@ -9,6 +9,8 @@
 
 #include <nlohmann/json.hpp>
 
+#include "mgmt/node_paths.h"
+#include "peers/mgmtctl/intercepts.h"
 #include "peers/mgmtctl/show_draw.h"
 #include "peers/mgmtctl/show_gather.h"
 #include "peers/mgmtctl/show_texts.h"
@@ -113,7 +115,9 @@ bool many(ctl_walk walk, const std::string &name, ctl_reply *out) {
     const auto add = [&](const std::string &node, const std::string &value) {
         out->bindings.push_back({node, "string", value});
     };
-    if (walk == ctl_walk::children && (name + "/" == CONFIG || name + "/" == STATE))
+    if (name == NODE_PLANE_STATE)
+        add(name + "/name", "table");
+    else if (walk == ctl_walk::children && (name + "/" == CONFIG || name + "/" == STATE))
         for (int i = 0; i < 256; i++)
             add(name + "/" + std::to_string(i), std::to_string(i));
     else if (name.ends_with("/router"))
@@ -210,7 +214,7 @@ TEST(Show, IsEmptyAndSaysSoWhereverMgmtdGoes) {
     canned from = one_group();
     from.wccpd_code = LC_IO_TIMED_OUT;
     EXPECT_EQ(from.gather().wccpd, wccpd_condition::silent);
-    EXPECT_EQ(from.asked, 6u) << "it is not asked again";
+    EXPECT_EQ(from.asked, 9u) << "it is not asked again";
     from.wccpd_code = 0;
     (void)from.gather();
     for (size_t all = from.asked, n = 0; n < all; n++) {
@@ -228,7 +232,7 @@ TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
     };
     snapshot_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
     std::vector<std::string> lines = draw_screen(gather_snapshot(query, limits), {79, 23, true, true, ""});
-    EXPECT_LE(asked, 7u + 23u * 6);
+    EXPECT_LE(asked, 12u + 23u * 6);
     ASSERT_EQ(lines.size(), 23u);
     EXPECT_NE(lines[1].find("routers 31/31  share 3%"), std::string::npos) << lines[1];
     EXPECT_NE(lines.back().find("and 235 groups not shown"), std::string::npos) << lines.back();
@@ -249,6 +253,109 @@ TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
     }
     EXPECT_NE(joined(draw_screen(detailed, {79, 60, false, false, ""})).find("and 30 routers more"),
               std::string::npos);
+}
+
+// --- Redirected traffic
+
+// P, T, I, L: of the data plane, a tunnel, an intercept, a group that is out of its routers; X: an
+// intercept's configuration, A: an accepted source.
+static void add_traffic(canned *from, const char *lines) {
+    static const std::map<char, const char *> roots = {
+        {'P', NODE_PLANE_STATE},         {'T', NODE_TUNNEL_STATE},     {'I', NODE_INTERCEPT_STATE},
+        {'L', NODE_ALARM_STATE "/left"}, {'X', NODE_INTERCEPT_CONFIG}, {'A', NODE_ACCEPT_CONFIG}};
+    std::istringstream in(lines);
+    for (std::string name, value; std::getline(in, name, ' ') && std::getline(in, value, '|');)
+        from->add(std::string(roots.at(name[0])) + name.substr(1), value);
+}
+
+static const char *const TRAFFIC =
+    "P/name kernel|P/reason ip_gre is there|P/clamped 0|P/refused/source 9|P/refused_source/10.0.0.9 9|"
+    "T/3 3|T/3/local 10.0.0.101|T/3/remote 10.0.0.1|T/3/interface wccp0|T/3/index 12|T/3/packets_in 1234567|"
+    "T/3/bytes_in 999999999|T/3/fragments 4|T/3/refused/flags 2|T/3/in 7|T/3/own 3|"
+    "I/51 51|I/51/proxy down|I/51/proxy_reason refused\033[2J|I/51/proxy_ms 640000|I/51/active "
+    "true|I/51/left true|"
+    "I/51/in 120|I/51/in_bytes 9000|I/51/to_proxy 100|I/51/returned 12|I/51/down 8|"
+    "I/52 52|I/52/proxy up|I/52/active false|I/52/in 99999|I/52/to_proxy 18446744073709551615|"
+    "L/51 no good check for 30 s|L/51/since 2026/11/25 00:10:11|"
+    "X/51 51|X/51/ports 80 443|X/51/to 3128|X/51/rest return|X/51/check http|X/51/check_argument /a|"
+    "A/10.0.0.8 10.0.0.8|A/10.0.0.8/router 0.0.0.0|";
+
+TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
+    canned from = one_group();
+    EXPECT_NE(joined(draw_screen(from.gather(), {80, 0, false, false, ""})).find("\n\ntunneld: no session\n"),
+              std::string::npos);
+    EXPECT_EQ(json::parse(draw_json(from.gather()))["traffic"]["clamped"], nullptr);
+    add_traffic(&from, TRAFFIC);
+    const snapshot shown = from.gather();
+    const std::string screen = joined(draw_screen(shown, {80, 0, false, false, ""}));
+    for (const char *text : {"51  left its routers",
+                             "\ntraffic  data plane kernel  1 tunnel\n"
+                             "  51  proxy down 0:10:40  in 120  to proxy 100  returned 12  proxy down 8\n"
+                             "  52  proxy up  in 99999  to proxy 18E  returned 0\n"
+                             "  group 51 has left its routers: no good check for 30 s\n"
+                             "  group 52: not ACTIVE in its policy group; new flows are returned\n"
+                             "  the router redirects this appliance's own traffic\n"
+                             "  refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
+                             "  packets come in fragments, and the MSS of no flow has been clamped\n"})
+        EXPECT_NE(screen.find(text), std::string::npos) << text << "\nnot in\n" << screen;
+    const json traffic = json::parse(draw_json(shown))["traffic"];
+    EXPECT_EQ(traffic["refused_sources"]["10.0.0.9"], 9);
+    EXPECT_EQ(traffic["tunnels"][0]["in"]["bytes"], 999999999);
+    EXPECT_EQ(traffic["intercepts"][1]["sorted"]["to_proxy"]["packets"], UINT64_MAX);
+    EXPECT_EQ(traffic["left"].dump(), R"([{"group":51,"reason":"no good check for 30 s"}])");
+    EXPECT_EQ(traffic["reasons"].size(), 5u);
+    // A proxy that is down is a reason of its own only while the group is in its routers, and fragments only
+    // while nothing is clamped; a source that is accepted by now is none.
+    std::erase_if(from.nodes,
+                  [](const ctl_binding &node) { return node.name.find("/left/") != std::string::npos; });
+    from.add(NODE_ACCEPT_CONFIG "/10.0.0.9", "10.0.0.9");
+    for (ctl_binding &node : from.nodes)
+        node.value = node.name.ends_with("/clamped") ? "1" : node.value;
+    const std::string lines = joined(draw_lines(from.gather()));
+    EXPECT_NE(lines.find("note  group 51: the proxy is down: refused?[2J\n"), std::string::npos) << lines;
+    for (const char *text : {"fragments", "refused source"})
+        EXPECT_EQ(lines.find(text), std::string::npos) << lines;
+}
+
+TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
+    canned from;
+    ctl_link link;
+    link.query = [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
+        return from.answer(walk, name, out, out_reason);
+    };
+    const auto printed = [](const std::function<int()> &command, int exit) {
+        testing::internal::CaptureStdout();
+        EXPECT_EQ(command(), exit);
+        fflush(stdout);
+        return testing::internal::GetCapturedStdout();
+    };
+    ctl_options options;
+    EXPECT_EQ(printed([&] { return tell_tunnels(options, link); }, CTL_UNREACHABLE),
+              "tunneld is not running\n");
+    add_traffic(&from, TRAFFIC);
+    EXPECT_EQ(printed([&] { return tell_tunnels(options, link); }, CTL_OK),
+              "data plane kernel: ip_gre is there\n  refused by reason:  source 9\n"
+              "tunnel 3  10.0.0.101 to 10.0.0.1  on wccp0  index 12\n"
+              "  in 1.2M (1.0G bytes)  out 0 (0 bytes)  fragments 4\n"
+              "  sorted: in 7  to proxy 0  returned 0  own 3\n  refused by reason:  flags 2\n"
+              "refused 9 from 10.0.0.9\naccepted 10.0.0.8\n"
+              "the router redirects this appliance's own traffic\n"
+              "refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
+              "packets come in fragments, and the MSS of no flow has been clamped\n");
+    EXPECT_EQ(printed([&] { return tell_intercepts(options, link, ""); }, CTL_OK),
+              "51 port 80 443 to 3128 check http /a\n  proxy down 0:10:40\n"
+              "  in 120  to proxy 100  returned 12  proxy down 8\n"
+              "  group 51 has left its routers: no good check for 30 s\n");
+    options.json = true;
+    const json one = json::parse(printed([&] { return tell_intercepts(options, link, "51"); }, CTL_OK));
+    EXPECT_EQ(one["intercepts"][0]["to"], 3128);
+    EXPECT_EQ(one["intercepts"][0]["sorted"]["in"]["bytes"], 9000);
+    EXPECT_EQ(one["intercepts"][0]["left_reason"], "no good check for 30 s");
+    EXPECT_EQ(
+        json::parse(printed([&] { return tell_intercepts(options, link, "52"); }, CTL_NOT_FOUND))["exit"], 4);
+    from.lost_after = from.asked + 1;
+    EXPECT_EQ(json::parse(printed([&] { return tell_tunnels(options, link); }, CTL_UNREACHABLE))["error"],
+              "mgmtd closed the session");
 }
 
 TEST(Show, AssignmentTextsAreReadTolerantly) {

@@ -96,11 +96,12 @@ static std::string clock_text() {
     return text;
 }
 
-// Of a line that can go: a group, whatever it says, or an alarm.
+// Of a line that can go: a group or its proxy, whatever it says, an alarm or a note.
 static std::string key_of(const std::string &line) {
-    if (line.starts_with("group "))
-        return line.substr(0, line.find("  "));
-    return line.starts_with("alarm ") ? line : "";
+    for (const char *kind : {"group ", "proxy of "})
+        if (line.starts_with(kind))
+            return line.substr(0, line.find("  "));
+    return line.starts_with("alarm ") || line.starts_with("note ") ? line : "";
 }
 
 static void print_changes(viewer *self, const snapshot &shown) {

@@ -337,6 +337,17 @@ static bool gather_alarms(gathering *work) {
     return true;
 }
 
+static bool gather_redirected(gathering *work) {
+    traffic_state traffic;
+    const auto ask = [work](ctl_walk walk, const std::string &name, ctl_reply *out) {
+        return work->ask(walk, name, out);
+    };
+    if (!gather_traffic(ask, &traffic))
+        return false;
+    work->shown.traffic = std::move(traffic);
+    return true;
+}
+
 static std::string first_value(const ctl_reply &reply) {
     return reply.bindings.empty() ? "" : clean_text(reply.bindings[0].value, 31);
 }
@@ -356,7 +367,7 @@ static void gather(gathering *work) {
     ctl_reply alive, version, mode, states, configs;
     work->shown.wccpd = wccpd_condition::running;
     if (!work->ask(ctl_walk::node, NODE_SYSTEM_MODE, &mode) || !gather_alarms(work) ||
-        !work->ask(ctl_walk::children, NODE_GROUP_CONFIG, &configs) ||
+        !gather_redirected(work) || !work->ask(ctl_walk::children, NODE_GROUP_CONFIG, &configs) ||
         !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_STATUS, &alive) ||
         !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_VERSION, &version) ||
         !work->ask_wccpd(ctl_walk::children, NODE_GROUP_STATE, &states))

@@ -2,6 +2,7 @@
 #include <nlohmann/json.hpp>
 
 #include "peers/mgmtctl/show_draw.h"
+#include "peers/mgmtctl/traffic_json.h"
 
 using json = nlohmann::ordered_json;
 
@@ -98,6 +99,7 @@ std::string draw_json(const snapshot &shown) {
     out["groups"] = json::array();
     for (const snapshot_group &group : shown.groups)
         out["groups"].push_back(group_json(group));
+    out["traffic"] = traffic_json(shown.traffic);
     out["alarms_total"] = shown.alarms_total;
     out["alarms"] = json::array();
     for (const snapshot_alarm &alarm : shown.alarms)

@@ -8,6 +8,8 @@
 #include <string>
 #include <vector>
 
+#include "peers/mgmtctl/traffic.h"
+
 // All texts are cleaned: printable ASCII of bounded length.
 struct snapshot_load {
     std::string appliance;
@@ -72,6 +74,7 @@ struct snapshot {
     size_t roles_active = 0, roles_backup = 0;
     std::vector<snapshot_alarm> alarms;
     size_t alarms_total = 0;
+    traffic_state traffic;
 };
 
 // The number that the text begins with.

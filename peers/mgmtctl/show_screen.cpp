@@ -112,6 +112,8 @@ static bool in_alarm(const snapshot &shown, const snapshot_group &group) {
 static std::pair<std::string, style> state_words(const snapshot &shown, const snapshot_group &group) {
     if (group.admin == "down")
         return {"admin down", style::dim};
+    if (shown.traffic.left.contains(group.id))
+        return {"left its routers", style::bad};
     if (!group.running)
         return {shown.wccpd == wccpd_condition::running ? "not taken by wccpd" : "configured", style::warn};
     std::string text = group.state + (group.designated ? ", designated" : "");
@@ -156,6 +158,12 @@ static std::string one_line(const snapshot_group &group, bool brief) {
     return text;
 }
 
+static std::string traffic_head(const traffic_state &traffic) {
+    if (traffic.tunneld != tunneld_condition::running)
+        return traffic.tunneld == tunneld_condition::absent ? "tunneld: no session" : "tunneld: no answer";
+    return "traffic  data plane " + traffic.plane + "  " + plural(traffic.tunnels.size(), "tunnel");
+}
+
 std::vector<std::string> draw_lines(const snapshot &shown) {
     if (!shown.unreachable.empty())
         return {"mgmtd: " + shown.unreachable};
@@ -168,6 +176,11 @@ std::vector<std::string> draw_lines(const snapshot &shown) {
     for (const snapshot_group &group : shown.groups)
         out.push_back("group " + std::to_string(group.id) + "  " + state_words(shown, group).first +
                       one_line(group, shown.brief));
+    out.push_back(traffic_head(shown.traffic));
+    for (const traffic_intercept &intercept : shown.traffic.intercepts)
+        out.push_back("proxy of group " + std::to_string(intercept.group) + "  " + intercept.proxy);
+    for (const traffic_reason &reason : traffic_reasons(shown.traffic))
+        out.push_back("note  " + reason.text);
     return out;
 }
 
@@ -374,12 +387,41 @@ static void draw_group(screen *on, const snapshot_group &group, size_t most) {
     draw_more(on, group.tables.size(), most, "table");
 }
 
+static void draw_reasons(screen *on, const std::vector<traffic_reason> &reasons, size_t most) {
+    for (size_t i = 0; i < std::min(reasons.size(), most); i++)
+        on->text("  " + reasons[i].text, style::warn);
+    draw_more(on, reasons.size(), most, "note");
+}
+
+static void draw_traffic(screen *on, size_t most) {
+    const traffic_state &traffic = on->shown.traffic;
+    on->text(traffic_head(traffic), style::bold);
+    for (const size_t i :
+         chosen(traffic.intercepts, most, [](const auto &one) { return one.proxy == "down"; })) {
+        const traffic_intercept &one = traffic.intercepts[i];
+        pen line = on->begin();
+        add_cells(&line, format("  %-4d", one.group));
+        add_cells(&line, proxy_text(one),
+                  one.proxy == "up"     ? style::good
+                  : one.proxy == "down" ? style::bad
+                                        : style::warn);
+        add_cells(&line, "  " + sorted_text(one.sorted));
+        on->end(&line);
+    }
+    draw_more(on, traffic.intercepts.size(), most, "intercept");
+    draw_reasons(on, traffic_reasons(traffic), most);
+}
+
 static std::vector<std::string> draw_whole(const snapshot &shown, const screen_form &form, size_t most) {
     screen on = {shown, form, {}};
     draw_head(&on, most);
     for (const snapshot_group &group : shown.groups) {
         on.text("");
         draw_group(&on, group, most);
+    }
+    if (shown.unreachable.empty()) {
+        on.text("");
+        draw_traffic(&on, most);
     }
     if (shown.groups.size() < shown.groups_total)
         on.text("and " + plural(shown.groups_total - shown.groups.size(), "group") + " not shown",
@@ -390,6 +432,9 @@ static std::vector<std::string> draw_whole(const snapshot &shown, const screen_f
 static std::vector<std::string> draw_briefly(const snapshot &shown, const screen_form &form) {
     screen on = {shown, form, {}};
     draw_head(&on, 3);
+    if (shown.unreachable.empty() && shown.traffic.tunneld != tunneld_condition::running)
+        on.text(traffic_head(shown.traffic));
+    draw_reasons(&on, traffic_reasons(shown.traffic), 3);
     size_t drawn = 0;
     for (const snapshot_group &group : shown.groups) {
         const size_t last = drawn + 1 < shown.groups_total ? 1 : 0; // the line that counts the others

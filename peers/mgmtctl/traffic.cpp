@@ -131,6 +131,15 @@ static void take_intercept(const std::vector<std::string> &parts, const std::str
     take_sorted(parts[1], value, &intercept->sorted);
 }
 
+static void take_accepted(const std::vector<std::string> &parts, const std::string &value,
+                          traffic_state *out) {
+    if (out->accepted.size() >= ENTRIES_MAX)
+        return;
+    std::string *router = &out->accepted[clean_text(parts[0], 15)];
+    if (parts.size() == 2 && parts[1] == "router" && value != "0.0.0.0")
+        *router = clean_text(value, 15);
+}
+
 static void take_left(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
     if (const int group = number_of(parts[0], -1); group >= 0 && group <= 255 && parts.size() == 1)
         out->left[group] = clean_text(value, 63);
@@ -142,9 +151,8 @@ bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
         bool of_tunneld;
         void (*take)(const std::vector<std::string> &parts, const std::string &value, traffic_state *out);
     } walks[] = {
-        {NODE_PLANE_STATE, true, take_plane},
-        {NODE_TUNNEL_STATE, true, take_tunnel},
-        {NODE_INTERCEPT_STATE, true, take_intercept},
+        {NODE_PLANE_STATE, true, take_plane},         {NODE_TUNNEL_STATE, true, take_tunnel},
+        {NODE_INTERCEPT_STATE, true, take_intercept}, {NODE_ACCEPT_CONFIG, false, take_accepted},
         {NODE_ALARM_STATE "/left", false, take_left},
     };
     *out = {};
@@ -202,8 +210,6 @@ std::string proxy_text(const traffic_intercept &intercept) {
     std::string out = "proxy " + (intercept.proxy.empty() ? "unknown" : intercept.proxy);
     if (intercept.proxy_ms > 0)
         out += " " + duration_text(intercept.proxy_ms);
-    if (!intercept.active)
-        out += ", standing by";
     return out;
 }
 
@@ -236,8 +242,8 @@ static void own_traffic(const traffic_state &state, const reason_list &list) {
 
 static void refused_sources(const traffic_state &state, const reason_list &list) {
     for (const auto &[address, packets] : state.refused_sources)
-        if (packets > 0)
-            list.add(count_text(packets) + " refused from " + address + "; mgmtctl tunnel accept " + address);
+        if (packets > 0 && !state.accepted.contains(address))
+            list.add("refused source " + address + ": mgmtctl tunnel accept " + address);
 }
 
 static void fragments(const traffic_state &state, const reason_list &list) {
@@ -245,7 +251,7 @@ static void fragments(const traffic_state &state, const reason_list &list) {
     for (const traffic_tunnel &tunnel : state.tunnels)
         packets += tunnel.fragments;
     if (packets > 0 && state.clamped == 0)
-        list.add(count_text(packets) + " fragments came in, and the MSS of no flow has been clamped");
+        list.add("packets come in fragments, and the MSS of no flow has been clamped");
 }
 
 static void left_groups(const traffic_state &state, const reason_list &list) {

@@ -37,14 +37,17 @@ struct traffic_intercept {
 };
 enum class tunneld_condition { running, silent, absent };
 struct traffic_state {
-    tunneld_condition tunneld = tunneld_condition::absent; // unless it is running, nothing else is known
+    tunneld_condition tunneld = tunneld_condition::absent; // unless it is running, it has said nothing
     std::string plane, plane_reason;
     uint64_t clamped = 0; // SYN-ACKs
     refused_counts refused;
     std::map<std::string, uint64_t> refused_sources; // packets by address
     std::vector<traffic_tunnel> tunnels;             // by id
     std::vector<traffic_intercept> intercepts;       // by group
-    std::map<int, std::string> left; // why a group is out of its routers, by group; mgmtd has it
+    // From mgmtd, also without a tunneld:
+    std::map<std::string, std::string>
+        accepted;                    // sources beside the routers; only beside this one, "" for all
+    std::map<int, std::string> left; // why a group is out of its routers, by group
 };
 
 // False: no answer.
@@ -57,14 +60,14 @@ struct sorted_way {
 const std::vector<sorted_way> &sorted_ways();
 // "in 120  to proxy 100  ...": packets, leaving out what is zero except for the first three.
 std::string sorted_text(const sorted_counts &counts);
-std::string proxy_text(const traffic_intercept &intercept);
-const char *tunneld_word(tunneld_condition condition); // "running", "silent", "absent"
+std::string proxy_text(const traffic_intercept &intercept); // "proxy up 0:10:40"
+const char *tunneld_word(tunneld_condition condition);      // "running", "silent", "absent"
 
 // Why traffic does not go where somebody would expect it to.
 struct traffic_reason {
     std::string word; // "own_traffic", "refused_source", ...: does not change
     int group;        // -1: of the whole appliance
-    std::string text; // one line, at most 76 characters
+    std::string text; // one line, at most 76 characters, without counts
 };
 std::vector<traffic_reason> traffic_reasons(const traffic_state &state);
 

@@ -12,7 +12,7 @@
 #include "peers/mgmtctl/intercepts.h"
 #include "peers/mgmtctl/render.h"
 #include "peers/mgmtctl/show_model.h"
-#include "peers/mgmtctl/traffic.h"
+#include "peers/mgmtctl/traffic_json.h"
 
 // --- Changes
 
@@ -93,18 +93,6 @@ struct asking {
 };
 } // namespace
 
-static ctl_json sorted_json(const sorted_counts &counts) {
-    ctl_json out = ctl_json::object();
-    for (const sorted_way &way : sorted_ways())
-        if (const auto found = counts.find(way.word); found != counts.end())
-            out[way.word] = {{"packets", found->second.packets}, {"bytes", found->second.bytes}};
-    return out;
-}
-
-static ctl_json text_or_null(const std::string &text) {
-    return text.empty() ? ctl_json(nullptr) : ctl_json(text);
-}
-
 static void put_absence(tunneld_condition condition) {
     if (condition != tunneld_condition::running)
         put(condition == tunneld_condition::absent ? "tunneld is not running\n"
@@ -114,7 +102,7 @@ static void put_absence(tunneld_condition condition) {
 static void put_reasons(const std::vector<traffic_reason> &reasons, int group) {
     for (const traffic_reason &reason : reasons)
         if (reason.group == group)
-            put("  " + reason.text + "\n");
+            put((group < 0 ? "" : "  ") + reason.text + "\n");
 }
 
 // --- Intercepts
@@ -133,15 +121,10 @@ static ctl_json intercept_json(const std::string &number, const std::map<std::st
             out[word.node] = nullptr;
     }
     const auto argument = nodes.find("check_argument");
-    out["check_argument"] = text_or_null(argument == nodes.end() ? "" : argument->second);
-    out["proxy"] = text_or_null(state ? state->proxy : "");
-    out["proxy_reason"] = text_or_null(state ? state->proxy_reason : "");
-    out["proxy_ms"] = state ? ctl_json(state->proxy_ms) : ctl_json(nullptr);
-    out["active"] = state ? ctl_json(state->active) : ctl_json(nullptr);
+    out["check_argument"] = argument == nodes.end() ? "" : argument->second;
+    out.update(intercept_state_json(state));
     const auto left = traffic.left.find(std::atoi(number.c_str()));
-    out["left"] = state ? ctl_json(state->left) : ctl_json(nullptr);
-    out["left_reason"] = text_or_null(left == traffic.left.end() ? "" : left->second);
-    out["packets"] = state ? sorted_json(state->sorted) : ctl_json(nullptr);
+    out["left_reason"] = left == traffic.left.end() ? ctl_json(nullptr) : ctl_json(left->second);
     return out;
 }
 
@@ -237,19 +220,6 @@ int ctl_bypass(const ctl_options &options, const std::vector<std::string> &words
 
 // --- Tunnels
 
-static ctl_json tunnel_json(const traffic_tunnel &tunnel) {
-    return {{"id", tunnel.id},
-            {"local", tunnel.local},
-            {"remote", tunnel.remote},
-            {"interface", text_or_null(tunnel.interface)},
-            {"index", tunnel.index},
-            {"in", {{"packets", tunnel.in.packets}, {"bytes", tunnel.in.bytes}}},
-            {"out", {{"packets", tunnel.out.packets}, {"bytes", tunnel.out.bytes}}},
-            {"fragments", tunnel.fragments},
-            {"refused", tunnel.refused},
-            {"sorted", sorted_json(tunnel.sorted)}};
-}
-
 static std::string refused_text(const refused_counts &refused) {
     std::string out;
     for (const auto &[reason, packets] : refused)
@@ -271,43 +241,28 @@ static void put_tunnels(const traffic_state &traffic) {
             std::to_string(tunnel.index) + "\n  in " + count_of_bytes(tunnel.in) + "  out " +
             count_of_bytes(tunnel.out) + "  fragments " + count_text(tunnel.fragments) +
             "\n  sorted: " + sorted_text(tunnel.sorted) + "\n" + refused_text(tunnel.refused));
+    for (const auto &[address, packets] : traffic.refused_sources)
+        put("refused " + count_text(packets) + " from " + address + "\n");
 }
 
 int tell_tunnels(const ctl_options &options, const ctl_link &link) {
     asking mgmtd = {link};
-    std::vector<std::pair<std::string, std::map<std::string, std::string>>> accepted;
     traffic_state traffic;
-    if (!mgmtd.ask_configuration(NODE_ACCEPT_CONFIG, &accepted) || !mgmtd.ask_traffic(&traffic))
+    if (!mgmtd.ask_traffic(&traffic))
         return tell_failure(options, mgmtd.failure);
-    const std::vector<traffic_reason> reasons = traffic_reasons(traffic);
     const bool running = traffic.tunneld == tunneld_condition::running;
-    ctl_json out = {{"tunneld", tunneld_word(traffic.tunneld)},
-                    {"plane", text_or_null(traffic.plane)},
-                    {"plane_reason", text_or_null(traffic.plane_reason)},
-                    {"clamped", running ? ctl_json(traffic.clamped) : ctl_json(nullptr)},
-                    {"refused", traffic.refused},
-                    {"refused_sources", traffic.refused_sources},
-                    {"tunnels", ctl_json::array()},
-                    {"accepted", ctl_json::array()},
-                    {"reasons", ctl_json::array()}};
-    for (const traffic_tunnel &tunnel : traffic.tunnels)
-        out["tunnels"].push_back(tunnel_json(tunnel));
+    ctl_json out = traffic_json(traffic);
+    out["accepted"] = ctl_json::array();
     if (!options.json && running)
         put_tunnels(traffic);
-    for (const auto &[address, nodes] : accepted) {
-        const auto found = nodes.find("router");
-        const std::string router = found == nodes.end() || found->second == "0.0.0.0" ? "" : found->second;
-        out["accepted"].push_back({{"address", address}, {"router", text_or_null(router)}});
+    for (const auto &[address, router] : traffic.accepted) {
+        out["accepted"].push_back(
+            {{"address", address}, {"router", router.empty() ? ctl_json(nullptr) : ctl_json(router)}});
         if (!options.json)
             put("accepted " + address + (router.empty() ? "" : " beside router " + router) + "\n");
     }
-    for (const traffic_reason &reason : reasons) {
-        if (reason.group >= 0)
-            continue;
-        out["reasons"].push_back({{"reason", reason.word}, {"text", reason.text}});
-        if (!options.json)
-            put(reason.text + "\n");
-    }
+    if (!options.json)
+        put_reasons(traffic_reasons(traffic), -1);
     if (options.json)
         put(json_line(out));
     else

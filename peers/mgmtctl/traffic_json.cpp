@@ -1,0 +1,74 @@
+#include "peers/mgmtctl/traffic_json.h"
+
+#include <nlohmann/json.hpp>
+
+static ctl_json text_or_null(const std::string &text) {
+    return text.empty() ? ctl_json(nullptr) : ctl_json(text);
+}
+
+static ctl_json count_json(const traffic_count &count) {
+    return {{"packets", count.packets}, {"bytes", count.bytes}};
+}
+
+static ctl_json sorted_json(const sorted_counts &counts) {
+    ctl_json out = ctl_json::object();
+    for (const sorted_way &way : sorted_ways())
+        if (const auto found = counts.find(way.word); found != counts.end())
+            out[way.word] = count_json(found->second);
+    return out;
+}
+
+static ctl_json tunnel_json(const traffic_tunnel &tunnel) {
+    return {{"id", tunnel.id},
+            {"local", tunnel.local},
+            {"remote", tunnel.remote},
+            {"interface", text_or_null(tunnel.interface)},
+            {"index", tunnel.index},
+            {"in", count_json(tunnel.in)},
+            {"out", count_json(tunnel.out)},
+            {"fragments", tunnel.fragments},
+            {"refused", tunnel.refused},
+            {"sorted", sorted_json(tunnel.sorted)}};
+}
+
+ctl_json intercept_state_json(const traffic_intercept *intercept) {
+    ctl_json out = {{"proxy", nullptr},  {"proxy_reason", nullptr}, {"proxy_ms", nullptr},
+                    {"active", nullptr}, {"left", nullptr},         {"sorted", nullptr}};
+    if (!intercept)
+        return out;
+    out["proxy"] = text_or_null(intercept->proxy);
+    out["proxy_reason"] = text_or_null(intercept->proxy_reason);
+    out["proxy_ms"] = intercept->proxy_ms;
+    out["active"] = intercept->active;
+    out["left"] = intercept->left;
+    out["sorted"] = sorted_json(intercept->sorted);
+    return out;
+}
+
+ctl_json traffic_json(const traffic_state &state) {
+    const bool running = state.tunneld == tunneld_condition::running;
+    ctl_json out = {{"tunneld", tunneld_word(state.tunneld)},
+                    {"plane", text_or_null(state.plane)},
+                    {"plane_reason", text_or_null(state.plane_reason)},
+                    {"clamped", running ? ctl_json(state.clamped) : ctl_json(nullptr)},
+                    {"refused", state.refused},
+                    {"refused_sources", state.refused_sources},
+                    {"tunnels", ctl_json::array()},
+                    {"intercepts", ctl_json::array()},
+                    {"left", ctl_json::array()},
+                    {"reasons", ctl_json::array()}};
+    for (const traffic_tunnel &tunnel : state.tunnels)
+        out["tunnels"].push_back(tunnel_json(tunnel));
+    for (const traffic_intercept &intercept : state.intercepts) {
+        ctl_json one = {{"group", intercept.group}};
+        one.update(intercept_state_json(&intercept));
+        out["intercepts"].push_back(one);
+    }
+    for (const auto &[group, reason] : state.left)
+        out["left"].push_back({{"group", group}, {"reason", text_or_null(reason)}});
+    for (const traffic_reason &reason : traffic_reasons(state))
+        out["reasons"].push_back({{"reason", reason.word},
+                                  {"group", reason.group < 0 ? ctl_json(nullptr) : ctl_json(reason.group)},
+                                  {"text", reason.text}});
+    return out;
+}

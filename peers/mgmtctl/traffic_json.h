@@ -1,0 +1,10 @@
+// Redirected traffic for scripts. The keys are documented (docs/mgmtctl.md) and stay; what isn't known is
+// null.
+#pragma once
+
+#include "peers/mgmtctl/render.h"
+#include "peers/mgmtctl/traffic.h"
+
+ctl_json traffic_json(const traffic_state &state);
+// What tunneld answers about one intercept, null: nothing.
+ctl_json intercept_state_json(const traffic_intercept *intercept);
