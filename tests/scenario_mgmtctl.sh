@@ -141,6 +141,11 @@ completed() { # WORD... : what the shell would offer
     lab_in a1 bash -c 'PATH=$1:$PATH; source "$2"; compopt() { :; }; shift 2
         COMP_WORDS=(mgmtctl "$@"); COMP_CWORD=$#; _mgmtctl; echo "${COMPREPLY[*]}"' - "$WCCP_BIN" "$top/packaging/mgmtctl.bash-completion" "$@"
 }
+ctl bypass add 10.0.0.0/8 >/dev/null && ctl intercept add 51 all to 3128 >/dev/null || fail "mgmtd refuses an intercept"
+[ "$(completed bypass delete 10.0.0.0/)" = 10.0.0.0/8 ] && [ "$(completed intercept set '')" = 51 ] &&
+    [ "$(completed intercept set 51 ch)" = check ] && [ "$(completed intercept set 51 rest d)" = drop ] ||
+    fail "the shell completes words of redirected traffic otherwise"
+ctl bypass delete 10.0.0.0/8 >/dev/null; ctl intercept delete 51 >/dev/null
 [ "$(completed al)" = alarms ] && [ "$(completed get "${G%1}")" = $G ] && [ "$(completed group set '')" = 51 ] &&
     [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&
     [ "$(completed walk --le)" = --leaves ] || fail "the shell completes otherwise"
