@@ -37,6 +37,16 @@
 #                                             ended before), and no process, segment, socket or interface is left
 #     lab_clean_log NODE [EXPRESSION...]      no line at error level or worse but those, no finding of a sanitizer
 #
+# Traffic: a router that was started with `--redirect c1=51` redirects what comes in from c1.
+#     lab_client NODE ROUTER [NET]            a namespace behind the router: NET.2, and NET.128 to NET.255 to fetch from
+#                                             (NET is the first three numbers, default 10.1.0)
+#     lab_server NODE ROUTER [NET]            the same at NET.2 (default 10.2.0), with web servers on ports 80 and 8080
+#     lab_gateway NODE ADDRESS                the default route of a node
+#     lab_fetch CLIENT [OPTIONS...]           `wccp_router fetch` from the client's addresses to the server 10.2.0.2
+#     lab_proxy NODE [PORT] [keep]            haproxy in an appliance, on port 3129, answering with "X-Proxy: NODE"; with
+#                                             `keep` it connects from the client's address. Stop it with lab_stop NODE proxy
+#     lab_intercept GROUP [NAME=VALUE]...     prints the section of an intercept, to port 3129 unless told
+#
 # How it holds together: lab_enter runs the script again as the first process of its own process, mount and network
 # namespaces (and of a user namespace, when started by an ordinary user). Every other namespace is held by a process
 # below that one, no name is bound and no file is made outside, so that whatever ends the script, be it kill -9 of
@@ -49,16 +59,19 @@
 #               that clock (lab/fast_clock.cpp), mgmtd and mgmtctl, whose limits are about work, by the wall's.
 #               SECONDS of all functions here are the wall's, but for lab_sleep, which sleeps for the protocol's.
 #   LAB_TUNNELD     options of tunneld that lab_appliance_start gives; "none" starts none
+#   LAB_PLANE       its data plane (default table, which carries nothing); empty: whatever the kernel can do
 #   LAB_LOG_LEVEL   of wccpd, in the configuration that lab_appliance_start writes (default info)
 
 LAB_HOME=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
 LAB_TOP=$(dirname "$LAB_HOME")
 : "${WCCP_BIN:=$LAB_TOP/build/release/bin}"
-: "${LAB_SPEED:=1}" "${LAB_LOG_LEVEL:=info}"
+: "${LAB_SPEED:=1}" "${LAB_LOG_LEVEL:=info}" "${LAB_PLANE=table}"
 LAB_CONFIG=/etc/opt/rvl/mgmtd.conf # inside an appliance
 declare -A LAB_INIT LAB_PID        # first process of an appliance; programs as NODE/NAME
 declare -A LAB_MARKED LAB_FOUND    # lines of the log that don't count; what an appliance held before its programs
 declare -A LAB_KILLED              # sockets that programs had no chance to remove, as an expression
+declare -A LAB_BARE                # nodes that have a network namespace alone: routers, clients, servers
+declare -A LAB_NET                 # the net of a client or server
 
 lab_die() { echo "lab: $*" >&2; exit 1; }
 
@@ -144,11 +157,84 @@ lab_router() { # NAME ADDRESS... [-- OPTIONS OF wccp_router]
     local node=$1 addresses=() which=(); shift
     while [ $# -gt 0 ] && [ "$1" != -- ]; do addresses+=("$1"); which+=(--router "$1"); shift; done
     [ $# -gt 0 ] && shift
-    unshare --net sleep infinity </dev/null &
-    LAB_INIT[$node]=$!
-    lab_wait_namespace "${LAB_INIT[$node]}" net
+    lab_bare "$node"
     lab_plug "$node" "${LAB_INIT[$node]}" "${addresses[@]}"
     lab_route_start "$node" "${which[@]}" "$@"
+    lab_redirect "$node"
+}
+# A network namespace, held by a process.
+lab_bare() { # NODE
+    unshare --net sleep infinity </dev/null &
+    LAB_INIT[$1]=$! LAB_BARE[$1]=yes
+    lab_wait_namespace "${LAB_INIT[$1]}" net
+}
+# What comes in by interface X goes into the router's device to-X. What the router writes back there has come in by
+# to-X, and takes the main table.
+lab_redirect() { # ROUTER
+    # shellcheck disable=SC2016
+    lab_in "$1" bash -c '
+        number=100
+        for device in $(ip -o link show type tun | grep -o "to-[^:@ ]*"); do
+            number=$((number + 1))
+            ip rule add iif "${device#to-}" preference $number lookup $number
+            ip route add default dev "$device" table $number
+            echo 0 >/proc/sys/net/ipv4/conf/$device/rp_filter
+        done
+        [ $number -gt 100 ] || exit 0
+        echo 0 >/proc/sys/net/ipv4/conf/all/send_redirects
+        echo 0 >/proc/sys/net/ipv4/conf/default/send_redirects
+        echo 0 >/proc/sys/net/ipv4/conf/eth0/send_redirects
+        echo 0 >/proc/sys/net/ipv4/conf/all/rp_filter
+        echo 0 >/proc/sys/net/ipv4/conf/default/rp_filter
+        echo 0 >/proc/sys/net/ipv4/conf/eth0/rp_filter
+        echo 1 >/proc/sys/net/ipv4/ip_forward' || lab_die "router $1 does not forward"
+}
+# A node behind a router, by an interface that has the node's name there.
+lab_behind() { # NODE ROUTER NET
+    local node=$1 router=$2 net=$3
+    lab_bare "$node"
+    LAB_NET[$node]=$net
+    ip link add eth0 netns "${LAB_INIT[$node]}" type veth peer name "$node" netns "${LAB_INIT[$router]}" ||
+        lab_die "no veth for $node"
+    lab_in "$router" ip address add "$net.1/24" dev "$node"
+    lab_in "$router" ip link set "$node" up
+    lab_in "$node" ip link set lo up
+    lab_in "$node" ip address add "$net.2/24" dev eth0
+    lab_in "$node" ip link set eth0 up
+    lab_in "$node" ip route add local "$net.128/25" dev lo
+    lab_gateway "$node" "$net.1"
+}
+lab_gateway() { # NODE ADDRESS
+    lab_in "$1" ip route replace default via "$2" || lab_die "no route of $1"
+}
+lab_client() { # NODE ROUTER [NET]
+    lab_behind "$1" "$2" "${3-10.1.0}"
+}
+lab_server() { # NODE ROUTER [NET]
+    lab_behind "$1" "$2" "${3-10.2.0}"
+    nsenter -t "${LAB_INIT[$1]}" --net "$WCCP_BIN/wccp_router" web --port 80 --port 8080 </dev/null >"$LAB/$1.out" 2>&1 &
+    LAB_PID[$1/web]=$!
+    local i
+    for ((i = 0; i < 100; i++)); do
+        [ "$(lab_in "$1" cat /proc/net/tcp | grep -cE ' 0+:(0050|1F90) 0+:0+ 0A')" != 2 ] || return 0
+        sleep 0.05
+    done
+    lab_die "the web server of $1 does not start"
+}
+lab_fetch() { # CLIENT [OPTIONS...]
+    lab_in "$1" "$WCCP_BIN/wccp_router" fetch --from "${LAB_NET[$1]}.128" 10.2.0.2 "${@:2}"
+}
+lab_proxy() { # NODE [PORT] [keep]
+    local port=${2:-3129} i
+    lab_start "$1" proxy "$(command -v env)" "LAB_NODE=$1" "LAB_PORT=$port" \
+        "LAB_SOURCE=0.0.0.0${3:+ usesrc clientip}" "$(PATH=$PATH:/usr/sbin command -v haproxy)" -db -f "$LAB_HOME/haproxy.cfg"
+    for ((i = 0; i < 200; i++)); do
+        ! lab_in "$1" cat /proc/net/tcp | grep -q "$(printf ' 0*:%04X 0*:0* 0A' "$port")" || return 0
+        lab_alive "$1" proxy || break
+        sleep 0.05
+    done
+    cat "$LAB/$1-proxy.out" >&2
+    lab_die "the proxy of $1 does not start"
 }
 lab_route_start() { # NAME OPTIONS... : (again) after lab_stop NAME router
     local node=$1; shift
@@ -189,7 +275,7 @@ lab_in() { # NAME COMMAND...
     local node=$1 all=(); shift
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
     # The root as well: the whole lab may run inside a chroot.
-    [ -n "${LAB_PID[$node/router]-}" ] || all=(--mount --root --ipc --pid --wdns=/)
+    [ -n "${LAB_BARE[$node]-}" ] || all=(--mount --root --ipc --pid --wdns=/)
     (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net "${all[@]}" "$@")
 }
 
@@ -321,6 +407,13 @@ lab_group() { # ID [ROUTER]... [NAME=VALUE]...
     done
 }
 
+lab_intercept() { # GROUP [NAME=VALUE]...
+    local word
+    printf '[/qv/tunneld/intercept/config/%s]\n' "$1"; shift
+    [[ " $*" = *' to='* ]] || echo 'to = 3129'
+    for word; do echo "${word%%=*} = ${word#*=}"; done
+}
+
 lab_write_config() { # NODE [TEXT]...
     local file=/proc/${LAB_INIT[$1]}/root$LAB_CONFIG
     shift
@@ -334,8 +427,12 @@ lab_appliance_start() { # NODE [TEXT]...
     LAB_FOUND[$node]=$(lab_remains "$node")
     lab_mgmtd_start "$node"
     # shellcheck disable=SC2086
-    [ "${LAB_TUNNELD-}" = none ] || lab_start "$node" tunneld tunneld ${LAB_TUNNELD-}
+    [ "${LAB_TUNNELD-}" = none ] || lab_tunneld_start "$node" ${LAB_TUNNELD-}
     lab_wccpd_start "$node"
+}
+lab_tunneld_start() { # NODE OPTIONS...
+    # shellcheck disable=SC2086
+    lab_start "$1" tunneld tunneld ${LAB_PLANE:+--plane $LAB_PLANE} "${@:2}"
 }
 lab_mgmtd_start() { # NODE
     : >"$LAB/$1-mgmtd.out"
@@ -437,6 +534,10 @@ lab_remains() { # NODE
         grep -hE "^ *[0-9]+: [0-9A-F]+:0800" /proc/net/udp /proc/net/raw | sed "s/^/socket /"
         sed 1d /proc/net/unix | grep -o "/.*" | grep -v "^/dev/log\$" | sed "s/^/socket /"
         sed "1,2d;s/:.*//;s/^ */interface /" /proc/net/dev
+        ip -o link show group 2048 | sed "s/^[0-9]*: /interface of group 2048 /;s/:.*//"
+        ip rule show | grep "proto 204" | sed "s/^/ip rule /"
+        ip route show table all | awk "match(\$0, / table [0-9]+/) && substr(\$0, RSTART + 7, RLENGTH - 7) >= 204800 { print \"route\", \$0 }"
+        nft list tables 2>/dev/null | grep tunneld | sed "s/^/nft /"
         ls -d /tmp/gcl-socks/* 2>/dev/null | sed "s/^/file /"'
 }
 
@@ -497,7 +598,7 @@ if [ "${BASH_SOURCE[0]}" = "$0" ]; then
     for n in $(seq "$routers"); do lab_router "r$n" "10.0.0.$n"; done
     for n in $(seq "$appliances"); do lab_appliance "a$n" "10.0.0.$((100 + n))"; done
     export LAB WCCP_BIN LAB_HOME LAB_TOP
-    nodes=$(declare -p LAB_INIT LAB_PID LAB_MARKED LAB_FOUND LAB_KILLED)
+    nodes=$(declare -p LAB_INIT LAB_PID LAB_MARKED LAB_FOUND LAB_KILLED LAB_BARE LAB_NET)
     export nodes
     if [ $# -gt 0 ]; then "$@"; exit; fi
     echo "routers: r1..r$routers at 10.0.0.1.. ; appliances: a1..a$appliances at 10.0.0.101.. ; files in $LAB"

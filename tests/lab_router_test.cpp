@@ -1,11 +1,11 @@
 // What the scenarios rely on when they judge wccpd by the lab's router: it takes in nothing that is stale,
-// cut or signed otherwise, and its view has the bytes of what it adopted. The rest of its conversation is
-// theirs.
+// cut or signed otherwise, its view has the bytes of what it adopted, and it sends each packet to the owner
+// of its bucket. The rest is for the scenarios.
 #include <gtest/gtest.h>
 
 #include <algorithm>
 
-#include "lab/router/router.h"
+#include "lab/router/forward.h"
 
 using namespace lab;
 
@@ -152,4 +152,75 @@ TEST(LabRouter, SignsAndChecks) {
     EXPECT_NE(copy, answer);
     lab.send(LOW, hello(LOW, 100, 0));
     EXPECT_EQ(lab.result(), "refused: not signed");
+}
+
+// ---- the data path
+
+// IPv4 with the first bytes of TCP.
+static bytes packet(const std::string &src, const std::string &dst, const std::string &ports) {
+    return hex("4500 002c 0001 4000 40 06 0000" + src + dst + ports + zeros(20));
+}
+
+TEST(LabRouter, FindsTheOwnerOfAPacket) {
+    bench lab;
+    lab.join(LOW, 100);
+    lab.join(HIGH, 200);
+    const auto ask = [&](const bytes &data, const std::set<uint8_t> &services = {51}) {
+        packet_fields fields;
+        EXPECT_TRUE(read_packet(data.data(), data.size(), &fields));
+        return find_owner(lab.self, services, fields);
+    };
+    const bytes web = packet("0a010080", "0a020002", "c0000050");
+    EXPECT_EQ(ask(web).owner, 0u); // no table yet
+    lab.send(LOW, hello(LOW, 100, lab.members(LOW).sent_ids.back()));
+    lab.send(LOW, hash_assignment(LOW, lab.members(LOW).sent_ids.back(), lab.in().change_number));
+    ASSERT_EQ(lab.result(), "adopted");
+    EXPECT_EQ(ask(web).owner, ask(packet("0a0100ff", "0a020002", "00010002")).owner); // by destination
+    EXPECT_EQ(ask(web, {52}).owner, 0u);
+    std::map<address, int> owners;
+    for (uint32_t i = 0; i < 512; i++)
+        owners[ask(packet("0a010080", word(0x0a020000 + i), "c0000050")).owner]++;
+    EXPECT_NEAR(owners[LOW], 200, 60); // 100 buckets of 256
+    EXPECT_EQ(owners[LOW] + owners[HIGH], 512);
+
+    // Both directions to one appliance: the other service hashes what is the source on the way back.
+    group &back = lab.self.groups[52] = lab.in();
+    back.service.id = 52;
+    back.service.flags = 1;
+    EXPECT_EQ(ask(packet("0a020002", "0a010080", "0050c000"), {52}).bucket, ask(web).bucket);
+    back.service.flags = 0x31;
+    back.service.ports = {80};
+    EXPECT_NE(ask(packet("0a020002", "0a010080", "0050c000"), {52}).owner, 0u);
+    EXPECT_EQ(ask(web, {52}).owner, 0u);
+    back.service.priority = 9;
+    EXPECT_EQ(ask(packet("0a020002", "0a010080", "00500050"), {51, 52}).in, &back);
+
+    const verdict found = ask(web);
+    EXPECT_EQ(gre_header(lab.self, found), hex("0000 883e 80 33 00" + word(found.bucket).substr(6)));
+    lab.self.options.gre_form = "plain";
+    EXPECT_EQ(gre_header(lab.self, found), hex("0000 883e"));
+    lab.self.options.gre_form = "ip";
+    EXPECT_EQ(gre_header(lab.self, found), hex("0000 0800"));
+    const auto begins = [](const bytes &gre) { return carried_at(gre.data(), gre.size()); };
+    EXPECT_EQ(begins(hex("0000 0800 45000014")), 4u);
+    EXPECT_EQ(begins(hex("0000 883e 45000014")), 4u);
+    EXPECT_EQ(begins(hex("0000 883e 80330007 45000014")), 8u);
+    EXPECT_EQ(begins(hex("2000 0800 45000014")), 0u);
+    EXPECT_EQ(begins(hex("0000 86dd 60000014")), 0u);
+
+    lab.in().current.buckets.fill(0);
+    EXPECT_EQ(ask(web).owner, 0u);
+    lab.in().current = {
+        kind::mask, LOW, 1, {}, {{{0, 0, 0, 3}, {{{0, 0, 0, 0}, LOW}, {{0, 0, 0, 2}, HIGH}}}}};
+    EXPECT_EQ(ask(web).owner, LOW);
+    EXPECT_EQ(ask(packet("0a010080", "0a020002", "c0000052")).owner, HIGH);
+    EXPECT_EQ(ask(packet("0a010080", "0a020002", "c0000051")).owner, 0u);
+
+    packet_fields fields;
+    for (const size_t place : {0u, 3u}) { // a version, a length that are not there
+        bytes bad = web;
+        bad[place] = 0x2f;
+        EXPECT_FALSE(read_packet(bad.data(), bad.size(), &fields)) << place;
+    }
+    EXPECT_FALSE(read_packet(web.data(), 43, &fields));
 }

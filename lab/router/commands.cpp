@@ -22,7 +22,9 @@ const char *const ROUTER_COMMANDS =
     "  nexus | ios                the form of its views\n"
     "  password [TEXT]            of its messages; none without a text\n"
     "  fault NAME [TIMES|always]  spoil the next I-See-You messages; fault none\n"
-    "  raw HEX [ADDRESS]          send these bytes, to all appliances or to one\n";
+    "  raw HEX [ADDRESS]          send these bytes, to all appliances or to one\n"
+    "  traffic [reset]            what was redirected to each appliance, as JSON; counted anew from now on\n"
+    "  gre redirect|plain|ip      redirected packets: with redirect header, without it, as type 0x0800\n";
 
 struct command_call {
     router *self;
@@ -235,6 +237,22 @@ static std::string do_show(const command_call &call) {
     return router_state(*call.self, call.now).dump();
 }
 
+static std::string do_traffic(const command_call &call) {
+    if (call.words.size() == 1)
+        return traffic_state(*call.self).dump();
+    if (call.words[1] != "reset")
+        return "error: traffic [reset]";
+    call.self->traffic = {};
+    return "ok";
+}
+
+static std::string do_gre(const command_call &call) {
+    if (std::find(std::begin(gre_forms), std::end(gre_forms), call.words[1]) == std::end(gre_forms))
+        return "error: gre redirect|plain|ip";
+    call.self->options.gre_form = call.words[1];
+    return "ok";
+}
+
 struct command_row {
     const char *name;
     size_t least, most; // words with the name
@@ -247,6 +265,7 @@ constexpr command_row COMMANDS[] = {
     {"assign", 5, 5, do_assign},     {"list", 2, 2, do_list},     {"unlist", 2, 2, do_list},
     {"offer", 4, 4, do_offer},       {"nexus", 1, 1, do_form},    {"ios", 1, 1, do_form},
     {"password", 1, 2, do_password}, {"fault", 2, 3, do_fault},   {"raw", 2, 3, do_raw},
+    {"traffic", 1, 2, do_traffic},   {"gre", 2, 2, do_gre},
 };
 
 std::string router_command(router *self, double now, const std::vector<std::string> &words, output *out) {

@@ -2,7 +2,8 @@
 //
 // This file has the sockets, the clock and the operator's words; what a router does is in router.cpp. One
 // thread, one poll: a socket bound to each router's address, one more per router for the multicast address,
-// the control socket, standard input, and signals by descriptor.
+// the control socket, standard input, signals by descriptor, and the descriptors of the data path
+// (forward.cpp), when the router has one.
 #include <fcntl.h>
 #include <netinet/in.h>
 #include <poll.h>
@@ -19,8 +20,10 @@
 
 #include <CLI/CLI.hpp>
 
+#include "lab/router/forward.h"
 #include "lab/router/router.h"
 #include "lab/router/tools.h"
+#include "lab/router/web.h"
 #include "runtime/ttime.h"
 #include "runtime/version.h"
 
@@ -36,6 +39,7 @@ struct station {
 };
 struct lab_process {
     std::vector<station> stations;
+    forwarder path; // of the one router, when there is one
     bool as_json = false;
     double began = 0;
 };
@@ -180,6 +184,10 @@ static void run(lab_process *all, int control) {
         fds.push_back({one.unicast, POLLIN, 0});
         fds.push_back({one.multicast, POLLIN, 0});
     }
+    const size_t path_at = fds.size();
+    if (!all->path.from.empty())
+        for (const int fd : forwarder_descriptors(all->path))
+            fds.push_back({fd, POLLIN, 0});
     for (;;) {
         (void)poll(fds.data(), fds.size(), TICK_MS);
         if (fds[0].revents) {
@@ -217,6 +225,34 @@ static void run(lab_process *all, int control) {
             router_tick(&one.machine, seconds_now() - all->began, &out);
             carry_out(*all, &one, out);
         }
+        for (size_t i = path_at; i < fds.size(); i++)
+            if (fds[i].revents)
+                forward_packets(&all->path, fds[i].fd);
+    }
+}
+
+// Interfaces that redirect, for the only router there is.
+static void open_path(lab_process *all, const std::vector<std::string> &redirect) {
+    for (const std::string &text : redirect) {
+        redirecting one;
+        if (!read_redirecting(text, &one)) {
+            fprintf(stderr, "wccp_router: redirect what by %s?\n", text.c_str());
+            exit(2);
+        }
+        all->path.from.push_back(one);
+    }
+    if (redirect.empty())
+        return;
+    if (all->stations.size() != 1) {
+        fputs("wccp_router: one router alone can redirect\n", stderr);
+        exit(2);
+    }
+    all->path.self = &all->stations.front().machine;
+    all->path.self->forwards = true;
+    const std::string wrong = open_forwarder(&all->path);
+    if (!wrong.empty()) {
+        fprintf(stderr, "wccp_router: %s\n", wrong.c_str());
+        exit(1);
     }
 }
 
@@ -234,10 +270,10 @@ int main(int argc, char **argv) {
     app.set_version_flag("--version", std::string("wccp_router ") + wccp_version());
     app.footer(std::string("Commands on standard input or through --control:\n") + ROUTER_COMMANDS);
     app.require_subcommand(0, 1);
-    std::vector<std::string> routers, forward = {"gre", "l2"}, giveback = {"gre", "l2"},
-                                      assign = {"hash", "mask"};
+    std::vector<std::string> routers, redirect, forward = {"gre", "l2"}, giveback = {"gre", "l2"},
+                                                assign = {"hash", "mask"};
     std::vector<uint16_t> services;
-    std::string form = "ios", multicast, reply = "group", join = "echo", control_path;
+    std::string form = "ios", multicast, reply = "group", join = "echo", control_path, gre_source;
     router_options options;
     lab_process all;
     app.add_option("--router", routers, "address of a router; may come often")->delimiter(',');
@@ -264,6 +300,12 @@ int main(int argc, char **argv) {
         ->check(CLI::IsMember({"first", "echo"}));
     app.add_option("--query-after", options.query_after, "seconds of silence before a Removal Query");
     app.add_option("--drop-after", options.drop_after, "seconds of silence before an appliance is dropped");
+    app.add_option("--redirect", redirect,
+                   "INTERFACE=SERVICE[,SERVICE]: what comes in there goes to the appliances; may come often");
+    app.add_option("--gre", options.gre_form,
+                   "redirected packets: with redirect header, without it, as type 0x0800")
+        ->check(CLI::IsMember(std::vector<std::string>(std::begin(gre_forms), std::end(gre_forms))));
+    app.add_option("--gre-source", gre_source, "address that they come from (default: the router's)");
     app.add_option("--control", control_path, "unix socket for commands");
     app.add_flag("--json", all.as_json, "one JSON object per message");
 
@@ -274,8 +316,20 @@ int main(int argc, char **argv) {
     CLI::App *ctl = app.add_subcommand("ctl", "send one command to a control socket");
     ctl->add_option("SOCKET", socket_path)->required();
     ctl->add_option("COMMAND", command)->required();
+    web_options web;
+    fetch_options fetch;
+    CLI::App *server =
+        app.add_subcommand("web", "a web server: GET /N answers with N bytes, POST takes a body");
+    server->add_option("--port", web.ports, "may come often")->required();
+    CLI::App *client =
+        app.add_subcommand("fetch", "fetch pages, and say in JSON how it went and who answered");
+    add_fetch_options(client, &fetch);
     CLI11_PARSE(app, argc, argv);
 
+    if (*server)
+        return run_web(web);
+    if (*client)
+        return run_fetch(fetch);
     if (*logd)
         return run_logd(log_file);
     if (*ctl) {
@@ -299,6 +353,13 @@ int main(int argc, char **argv) {
         }
         options.group = *group;
     }
+    if (!gre_source.empty()) {
+        options.gre_source = address_of(gre_source).value_or(0);
+        if (options.gre_source == 0) {
+            fprintf(stderr, "wccp_router: %s is no address\n", gre_source.c_str());
+            return 2;
+        }
+    }
     for (const std::string &text : routers) {
         const auto self = address_of(text);
         if (!self) {
@@ -320,6 +381,7 @@ int main(int argc, char **argv) {
         fprintf(stderr, "wccp_router: %s: %s\n", control_path.c_str(), strerror(errno));
         return 1;
     }
+    open_path(&all, redirect);
     all.began = seconds_now();
     run(&all, control);
     if (control >= 0)

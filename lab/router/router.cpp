@@ -544,6 +544,22 @@ static json group_state(const group &in, double now) {
     return state;
 }
 
+json traffic_state(const router &self) {
+    const traffic &from = self.traffic;
+    json state = {{"routed", from.routed},
+                  {"lost", from.lost},
+                  {"fragmented", from.fragmented},
+                  {"refused_returns", from.refused_returns},
+                  {"appliances", json::object()}};
+    for (const auto &[who, one] : from.appliances)
+        state["appliances"][text_of(who)] = {{"packets", one.packets},
+                                             {"bytes", one.bytes},
+                                             {"flows", one.flows},
+                                             {"returned", one.returned},
+                                             {"returned_redirected", one.returned_redirected}};
+    return state;
+}
+
 json router_state(const router &self, double now) {
     json state;
     state["router"] = text_of(self.options.self);
@@ -556,6 +572,8 @@ json router_state(const router &self, double now) {
     state["counters"] = json::object();
     for (const auto &[name, value] : self.counters)
         state["counters"][name] = value;
+    if (self.forwards)
+        state["traffic"] = traffic_state(self);
     return state;
 }
 

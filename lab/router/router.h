@@ -6,6 +6,7 @@
 #include <map>
 #include <set>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include <nlohmann/json.hpp>
@@ -27,6 +28,26 @@ struct router_options {
     bool join_at_first = false; // an appliance is taken into the view before it has echoed a receive id
     double query_after = 25;    // of silence
     double drop_after = 30;
+    std::string gre_form = "redirect"; // of redirected packets; see gre_forms
+    address gre_source = 0;            // they come from there, 0: from `self`
+};
+// 0x883E with the redirect header, 0x883E without it, 0x0800.
+constexpr const char *gre_forms[] = {"redirect", "plain", "ip"};
+
+// What the data path has carried. Bytes are those of the carried packets.
+struct appliance_traffic {
+    uint64_t packets = 0, bytes = 0;
+    uint64_t flows = 0;               // that were seen for the first time
+    uint64_t returned = 0;            // packets that came back in GRE
+    uint64_t returned_redirected = 0; // of these, as type 0x883E
+};
+struct traffic {
+    std::map<address, appliance_traffic> appliances;
+    std::unordered_set<uint64_t> flows;
+    uint64_t routed = 0;          // packets that were not redirected
+    uint64_t lost = 0;            // no neighbour, or no room
+    uint64_t fragmented = 0;      // sent in more than one outer packet
+    uint64_t refused_returns = 0; // GRE that is from no appliance or cannot be read
 };
 
 struct member {
@@ -83,6 +104,8 @@ struct router {
     std::string fault;  // what is wrong with the next I-See-You messages
     int fault_left = 0; // -1 for ever
     std::map<std::string, uint64_t> counters;
+    bool forwards = false; // has a data path
+    lab::traffic traffic;
 };
 
 // `to` is the address that it was sent to: the router's or the multicast one.
@@ -92,6 +115,7 @@ void router_tick(router *self, double now, output *out);
 // What the operator types: an answer, beginning with "error:" when it makes no sense.
 std::string router_command(router *self, double now, const std::vector<std::string> &words, output *out);
 json router_state(const router &self, double now);
+json traffic_state(const router &self);
 std::string event_line(const json &event);
 
 extern const char *const ROUTER_COMMANDS; // help text

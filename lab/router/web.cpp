@@ -1,0 +1,322 @@
+// Blocking sockets with time limits, a thread for each connection.
+#include "lab/router/web.h"
+
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+#include <map>
+#include <mutex>
+#include <thread>
+
+#include <CLI/CLI.hpp>
+#include <nlohmann/json.hpp>
+
+#include "lab/router/wire.h"
+#include "runtime/ttime.h"
+
+namespace lab {
+
+constexpr size_t PIECE = 65536;
+constexpr size_t LONGEST_HEADER = 8192;
+
+static double wall_seconds() {
+    return static_cast<double>(lt_monotonic_ns()) / 1e9;
+}
+
+// Byte number `at` of any body. The period is no power of two: a lost or repeated packet shows.
+static char content_at(uint64_t at) {
+    return static_cast<char>('a' + at % 251 % 26);
+}
+// Content from any place of the period on.
+static const std::string &content() {
+    static const std::string all = [] {
+        std::string text(PIECE + 251, ' ');
+        for (size_t i = 0; i < text.size(); i++)
+            text[i] = content_at(i);
+        return text;
+    }();
+    return all;
+}
+
+static void set_limits(int fd, double seconds) {
+    timeval limit = {};
+    limit.tv_sec = static_cast<time_t>(seconds);
+    limit.tv_usec = static_cast<suseconds_t>((seconds - static_cast<double>(limit.tv_sec)) * 1e6);
+    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
+    setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
+    const int one = 1;
+    setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+}
+
+static bool send_all(int fd, const char *data, size_t size) {
+    while (size > 0) {
+        const ssize_t went = send(fd, data, size, MSG_NOSIGNAL);
+        if (went <= 0)
+            return false;
+        data += went;
+        size -= static_cast<size_t>(went);
+    }
+    return true;
+}
+static bool send_body(int fd, uint64_t size) {
+    for (uint64_t at = 0; at < size;) {
+        const size_t piece = static_cast<size_t>(std::min<uint64_t>(PIECE, size - at));
+        if (!send_all(fd, content().data() + at % 251, piece))
+            return false;
+        at += piece;
+    }
+    return true;
+}
+
+struct stream {
+    int fd;
+    std::string waiting; // read and not used
+    const char *wrong = "";
+};
+static bool read_more(stream *in) {
+    char part[PIECE];
+    const ssize_t got = recv(in->fd, part, sizeof part, 0);
+    if (got > 0) {
+        in->waiting.append(part, static_cast<size_t>(got));
+        return true;
+    }
+    in->wrong = got == 0 ? "closed" : errno == EAGAIN ? "timeout" : errno == ECONNRESET ? "reset" : "read";
+    return false;
+}
+static bool read_head(stream *in, std::string *head) {
+    size_t end;
+    while ((end = in->waiting.find("\r\n\r\n")) == std::string::npos) {
+        if (in->waiting.size() > LONGEST_HEADER) {
+            in->wrong = "header";
+            return false;
+        }
+        if (!read_more(in))
+            return false;
+    }
+    *head = in->waiting.substr(0, end + 2);
+    in->waiting.erase(0, end + 4);
+    return true;
+}
+// Reads the body and compares it.
+static bool read_body(stream *in, uint64_t size) {
+    for (uint64_t at = 0; at < size;) {
+        if (in->waiting.empty() && !read_more(in))
+            return false;
+        const size_t piece = static_cast<size_t>(std::min<uint64_t>({in->waiting.size(), PIECE, size - at}));
+        if (memcmp(in->waiting.data(), content().data() + at % 251, piece) != 0) {
+            in->wrong = "content";
+            return false;
+        }
+        in->waiting.erase(0, piece);
+        at += piece;
+    }
+    return true;
+}
+static std::string header_of(const std::string &head, const char *name) {
+    const size_t length = strlen(name);
+    for (size_t at = head.find("\r\n"); at != std::string::npos; at = head.find("\r\n", at)) {
+        at += 2;
+        if (head.size() <= at + length || head[at + length] != ':' ||
+            strncasecmp(&head[at], name, length) != 0)
+            continue;
+        const size_t begins = head.find_first_not_of(' ', at + length + 1);
+        return head.substr(begins, head.find("\r\n", begins) - begins);
+    }
+    return "";
+}
+static uint64_t number_in(const std::string &text) {
+    return strtoull(text.c_str(), nullptr, 10);
+}
+
+// ---- the server
+
+static void serve_connection(int fd, address peer) {
+    set_limits(fd, 60);
+    stream in = {fd, "", ""};
+    for (std::string head; read_head(&in, &head);) {
+        const bool upload = head.starts_with("POST ");
+        uint64_t size = 0;
+        if (upload) {
+            if (strcasecmp(header_of(head, "Expect").c_str(), "100-continue") == 0)
+                (void)send_all(fd, "HTTP/1.1 100 Continue\r\n\r\n", 25);
+            if (!read_body(&in, number_in(header_of(head, "Content-Length"))))
+                break;
+        } else if (const size_t slash = head.find('/'); slash != std::string::npos) {
+            size = number_in(head.substr(slash + 1, 20));
+        }
+        const std::string answer =
+            "HTTP/1.1 200 OK\r\nContent-Type: text/plain\r\nContent-Length: " + std::to_string(size) +
+            "\r\nX-Peer: " + text_of(peer) + "\r\n\r\n";
+        if (!send_all(fd, answer.data(), answer.size()) || !send_body(fd, size) ||
+            strcasecmp(header_of(head, "Connection").c_str(), "close") == 0)
+            break;
+    }
+    close(fd);
+}
+
+static void accept_connections(int listener) {
+    for (;;) {
+        sockaddr_in peer = {};
+        socklen_t length = sizeof peer;
+        const int fd = accept4(listener, reinterpret_cast<sockaddr *>(&peer), &length, SOCK_CLOEXEC);
+        if (fd >= 0)
+            std::thread(serve_connection, fd, ntohl(peer.sin_addr.s_addr)).detach();
+    }
+}
+
+int run_web(const web_options &options) {
+    std::vector<std::thread> listeners;
+    for (const uint16_t port : options.ports) {
+        const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        const int one = 1;
+        sockaddr_in place = {};
+        place.sin_family = AF_INET;
+        place.sin_port = htons(port);
+        setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
+        if (fd < 0 || bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0 ||
+            listen(fd, 1024) != 0) {
+            perror("web");
+            _exit(1);
+        }
+        listeners.emplace_back(accept_connections, fd);
+    }
+    for (std::thread &one : listeners)
+        one.join();
+    return 0;
+}
+
+// ---- the client
+
+struct fetched {
+    const char *wrong = nullptr; // or why it has failed
+    std::string proxy, peer;
+    double took = 0;
+};
+static const char *connect_from(int fd, const fetch_options &options, uint32_t source) {
+    sockaddr_in place = {};
+    place.sin_family = AF_INET;
+    if (!options.from.empty()) {
+        place.sin_addr.s_addr = htonl(address_of(options.from).value_or(0) + source);
+        if (bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0)
+            return "bind";
+    }
+    place.sin_port = htons(options.port);
+    place.sin_addr.s_addr = htonl(address_of(options.server).value_or(0));
+    if (connect(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) == 0)
+        return nullptr;
+    return errno == EINPROGRESS ? "connect timeout" : errno == ECONNREFUSED ? "refused" : "connect";
+}
+static const char *talk(int fd, const fetch_options &options, fetched *out) {
+    stream in = {fd, "", "send"};
+    const bool post = options.upload > 0;
+    const std::string request = std::string(post ? "POST /upload" : "GET /" + std::to_string(options.size)) +
+                                " HTTP/1.1\r\nHost: " + options.server + "\r\n" +
+                                (post ? "Content-Length: " + std::to_string(options.upload) + "\r\n" : "") +
+                                "\r\n";
+    for (uint32_t i = 0; i < options.requests; i++) {
+        std::string head;
+        if (!send_all(fd, request.data(), request.size()) || !send_body(fd, options.upload) ||
+            !read_head(&in, &head))
+            return in.wrong;
+        if (!head.starts_with("HTTP/1.1 200"))
+            return "status";
+        if (!post && number_in(header_of(head, "Content-Length")) != options.size)
+            return "length";
+        if (!read_body(&in, number_in(header_of(head, "Content-Length"))))
+            return in.wrong;
+        out->proxy = header_of(head, "X-Proxy");
+        out->peer = header_of(head, "X-Peer");
+    }
+    return nullptr;
+}
+static fetched fetch_once(const fetch_options &options, uint32_t source) {
+    fetched one;
+    const double began = wall_seconds();
+    const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    set_limits(fd, options.timeout);
+    one.wrong = connect_from(fd, options, source);
+    if (!one.wrong)
+        one.wrong = talk(fd, options, &one);
+    close(fd);
+    one.took = wall_seconds() - began;
+    return one;
+}
+
+struct tally {
+    std::mutex lock;
+    std::atomic<uint32_t> next = 0;
+    uint64_t good = 0, failed = 0;
+    double slowest = 0, last_good = 0, longest_gap = 0; // a gap: nothing was fetched
+    std::map<std::string, uint64_t> proxies, peers, failures;
+};
+static void fetch_many(const fetch_options &options, double began, tally *all) {
+    for (;;) {
+        const uint32_t number = all->next++;
+        if (options.seconds > 0 ? wall_seconds() - began >= options.seconds : number >= options.count)
+            return;
+        const fetched one = fetch_once(options, number % options.sources);
+        {
+            const std::lock_guard guard(all->lock);
+            if (one.wrong) {
+                all->failed++;
+                all->failures[one.wrong]++;
+            } else {
+                const double now = wall_seconds();
+                all->good++;
+                all->proxies[one.proxy]++;
+                all->peers[one.peer]++;
+                all->slowest = std::max(all->slowest, one.took);
+                all->longest_gap = std::max(all->longest_gap, now - all->last_good);
+                all->last_good = now;
+            }
+        }
+        if (options.pause > 0)
+            usleep(static_cast<useconds_t>(options.pause * 1e6));
+    }
+}
+
+void add_fetch_options(CLI::App *app, fetch_options *options) {
+    app->add_option("SERVER", options->server)->required()->check(CLI::ValidIPV4);
+    app->add_option("--port", options->port);
+    app->add_option("--from", options->from, "first source address")->check(CLI::ValidIPV4);
+    app->add_option("--sources", options->sources, "source addresses from there on")
+        ->check(CLI::PositiveNumber);
+    app->add_option("--count", options->count, "connections, one after the other");
+    app->add_option("--requests", options->requests, "on each connection");
+    app->add_option("--parallel", options->parallel, "connections at a time")->check(CLI::Range(1, 4096));
+    app->add_option("--size", options->size, "bytes asked for");
+    app->add_option("--upload", options->upload, "bytes posted instead");
+    app->add_option("--timeout", options->timeout, "seconds of silence that a fetch survives");
+    app->add_option("--seconds", options->seconds, "go on for so long, whatever --count says");
+    app->add_option("--pause", options->pause, "seconds after each fetch");
+}
+
+int run_fetch(const fetch_options &options) {
+    tally all;
+    const double began = all.last_good = wall_seconds();
+    std::vector<std::thread> workers;
+    for (uint32_t i = 0; i < options.parallel; i++)
+        workers.emplace_back(fetch_many, std::cref(options), began, &all);
+    for (std::thread &one : workers)
+        one.join();
+    const double ended = wall_seconds();
+    const uint64_t each = (options.upload ? options.upload : options.size) * options.requests;
+    const nlohmann::ordered_json result = {
+        {"fetched", all.good},      {"failed", all.failed},
+        {"bytes", all.good * each}, {"seconds", ended - began},
+        {"slowest", all.slowest},   {"longest_gap", std::max(all.longest_gap, ended - all.last_good)},
+        {"proxies", all.proxies},   {"peers", all.peers},
+        {"failures", all.failures}};
+    puts(result.dump().c_str());
+    return all.failed == 0 && all.good > 0 ? 0 : 1;
+}
+
+} // namespace lab
