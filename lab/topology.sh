@@ -568,9 +568,9 @@ lab_clean_log() { # NODE [EXPRESSION...]
 # Writes what passes the bridge to a file until the lab ends or lab_capture_end. tcpdump wants to change its user and
 # groups, which a user namespace of an ordinary user refuses: dumpcap, which comes with tshark, does it there.
 lab_capture() { # FILE
-    local with=(tcpdump -i lan --immediate-mode -U -Z root -w "$1" udp port 2048) said='listening on'
+    local with=(tcpdump -i lan --immediate-mode -U -Z root -w "$1" udp port 2048 or ip proto 47) said='listening on'
     if [ "$(cat /proc/self/setgroups)" = deny ]; then
-        with=(dumpcap -q -P -i lan -f 'udp port 2048' -w "$1") said='Capturing on'
+        with=(dumpcap -q -P -i lan -f 'udp port 2048 or ip proto 47' -w "$1") said='Capturing on'
     fi
     "${with[@]}" </dev/null >"$LAB/capture.out" 2>&1 &
     LAB_CAPTURE=$!

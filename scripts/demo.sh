@@ -1,18 +1,21 @@
 #!/bin/bash
 # demo.sh [--capture FILE] [--plain] [--speed N] [--no-build]
-# Two routers and two appliances in namespaces of their own: they find each other, elect a designated appliance, share
-# 256 hash buckets by weight, then the values of a mask; an operator changes a weight; the designated appliance dies,
-# and the other takes over. On a terminal `mgmtctl show --watch` of the appliance that survives stays on the screen,
-# below what is awaited and for how long; without one there is a line for each step. Takes some two minutes, installs
-# and builds what is missing, leaves nothing running.
-#   --capture FILE   keep the packets, for tshark or wireshark
+# A client, a server, a router that redirects, and two appliances with a proxy each, in namespaces of their own: the
+# appliances join, the designated one shares 256 hash buckets by weight, and pages that the client fetches come through
+# the proxies in these shares. Then the proxy of one is killed, and starts again; then the whole appliance dies. The
+# fetches go on. On a terminal `mgmtctl show --watch` of the appliance that survives stays on the screen, below what is
+# awaited, for how long, and by whom the last pages came; without one there is a line for each step. Takes some 70
+# seconds, installs and builds what is missing, leaves nothing running.
+#   --capture FILE   keep the packets of the protocol and of redirected flows, for tshark or wireshark
 #   --plain          lines, on a terminal as well
-#   --speed N        all protocol times N times as fast
+#   --speed N        all protocol times N times as fast (default 2)
 #   --no-build       take the programs from $WCCP_BIN
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
 capture='' plain='' build=yes
 arguments=("$@")
+: "${LAB_SPEED:=2}"
+export LAB_SPEED LAB_PLANE=
 while [ $# -gt 0 ]; do
     case $1 in
     --capture) capture=$(readlink -f "${2?a file}") || exit 2; shift 2 ;;
@@ -21,10 +24,10 @@ while [ $# -gt 0 ]; do
         [[ ${2?a number} =~ ^[1-9][0-9]*(\.[0-9]+)?$ ]] || { echo "demo: a speed of $2?" >&2; exit 2; }
         export LAB_SPEED=$2; shift 2 ;;
     --no-build) build=''; shift ;;
-    *) sed -n '2,11s/^# \{0,1\}//p' "$0"; exit 2 ;;
+    *) sed -n '2,12s/^# \{0,1\}//p' "$0"; exit 2 ;;
     esac
 done
-own_rows=6
+own_rows=7
 exec {screen}>&1
 measure() { # sets `rows` and `columns` of the terminal
     read -r rows columns < <(stty size <&"$screen" 2>/dev/null)
@@ -75,9 +78,9 @@ lab_enter "$0" "${arguments[@]}"
 
 # ---- who takes part
 
-declare -A address=([r1]=10.0.0.1 [r2]=10.0.0.2 [a1]=10.0.0.101 [a2]=10.0.0.102)
+declare -A address=([r1]=10.0.0.1 [a1]=10.0.0.101 [a2]=10.0.0.102) weight=([a1]=60 [a2]=100)
 survivor=a2
-everyone="routers r1 ${address[r1]} r2 ${address[r2]}, appliances a1 ${address[a1]} a2 ${address[a2]}"
+everyone="client c1, server s1, router r1 ${address[r1]}, appliances a1 ${address[a1]} a2 ${address[a2]}"
 
 # ---- the output: lines with the time of the protocol's clock
 
@@ -116,14 +119,23 @@ operate() { # APPLIANCE WORDS OF mgmtctl...
 
 # ---- what is seen: of the routers' side by asking them, of the appliances' by mgmtctl
 
-declare -A members_of
-seen='{}'
+members='' seen='{}' pages='' fetched='{}'
 look() {
-    local id
-    for id in 51 52; do
-        members_of[$id]=$(lab_ctl r1 members $id; echo; lab_ctl r2 members $id)
-    done
+    members=$(lab_ctl r1 members 51)
     seen=$(lab_manage $survivor show)
+    fetch_pages 32 0.4
+}
+# Pages for so many addresses of the client; who has answered.
+fetch_pages() { # COUNT TIMEOUT
+    fetched=$(lab_fetch c1 --count "$1" --sources "$1" --parallel "$1" --timeout "$2")
+    pages=$(jq -r '(.fetched + .failed) as $all | def part: "\(.) (\(100 * . / $all | round)%)";
+        "of \($all) pages a1 \(.proxies.a1 // 0 | part)  a2 \(.proxies.a2 // 0 | part)  server alone \(.proxies[""] // 0 | part)  none \(.failed | part)"' \
+        <<<"$fetched")
+}
+# In a line, what 128 addresses of the client get.
+browse() {
+    fetch_pages 128 1
+    say "  c1: $pages"
 }
 fact() { # GROUP : in a line
     # shellcheck disable=SC2016
@@ -139,7 +151,7 @@ fact() { # GROUP : in a line
 
 # The rows above the live picture, in one piece, since that is drawn by another process.
 draw() {
-    local now text row gone bar='' i cells=20 lines styles=(0 1 0 36 36 2)
+    local now text row gone bar='' i cells=20 lines styles=(0 1 0 32 36 36 2)
     clock
     measure
     gone=$((now - step_began))
@@ -150,7 +162,7 @@ draw() {
     printf -v text '%d:%02d  %s' $((now / 60)) $((now % 60)) "$everyone"
     printf -v row '%*s' "$columns" ''
     row="--- $survivor# mgmtctl show --watch ${row// /-}"
-    lines=("$text" "$step" "$bar" "${typed[0]}" "${typed[1]}" "$row")
+    lines=("$text" "$step" "$bar" "${pages:+c1: }$pages" "${typed[0]}" "${typed[1]}" "$row")
     text=''
     for ((i = 0; i < own_rows; i++)); do
         text+=$'\033['$((i + 1))$'H\033['"${styles[i]}m${lines[i]:0:columns-1}"$'\033[0m\033[K'
@@ -181,7 +193,7 @@ await() { # LIMIT EXPECTED WHAT CONDITION... : seconds of the protocol
         # The programs themselves are no faster by the faster clock.
         if [ $(((SECONDS - wall - 10) * speed_milli / 1000)) -ge "$limit" ]; then
             echo "demo: after $limit s still no $awaited" >&2
-            printf '%s\n' "${members_of[@]}" "$seen" >&2
+            printf '%s\n' "$members" "$fetched" "$seen" >&2
             tail -n 5 "$LAB"/*.log "$LAB"/*.out >&2
             exit 1
         fi
@@ -194,68 +206,72 @@ await() { # LIMIT EXPECTED WHAT CONDITION... : seconds of the protocol
 
 # ---- conditions
 
-members_are() { # GROUP COUNT : at both routers together
-    [ "$(grep -c . <<<"${members_of[$1]}")" = "$2" ]
+members_are() { # COUNT
+    [ "$(grep -c . <<<"$members")" = "$1" ]
 }
-asked() { [[ ${members_of[51]} = *' 1'$'\n'* ]] || [[ ${members_of[51]} = *' 1' ]] || members_are 51 2; }
-group_is() { # GROUP JQ : what the survivor tells of it
-    jq -e --argjson id "$1" ".groups[] | select(.id == \$id) | $2" <<<"$seen" >/dev/null 2>&1
+asked() { grep -q ' 1$' <<<"$members" || members_are 1; }
+group_is() { # JQ : what the survivor says of it
+    jq -e ".groups[] | select(.id == 51) | $1" <<<"$seen" >/dev/null 2>&1
 }
-# Every bucket of a group's one table has an owner, and the appliances have these shares.
+pages_are() { # JQ : of those of the last look
+    jq -e "$1" <<<"$fetched" >/dev/null
+}
+# Every bucket of the one table has an owner, and the appliances have these shares.
 shares='(.tables | length == 1 and all(.[].buckets[]; .appliance)) and (.appliances | map(.share_percent))'
 
 # ---- the story
 
 tell_step "Start of $everyone"
+lab_router r1 ${address[r1]} -- --redirect c1=51 --forward gre --return gre
+lab_client c1 r1
+lab_server s1 r1
 [ -z "$capture" ] || lab_capture "$capture" || exit 1
-lab_router r1 ${address[r1]}
-lab_router r2 ${address[r2]}
 for a in a1 a2; do
     lab_appliance $a "${address[$a]}"
+    lab_gateway $a ${address[r1]}
+    lab_proxy $a
     lab_appliance_start $a
 done
 live begins
-routers="router ${address[r1]} router ${address[r2]}"
-tell_step 'Here-I-Am, I-See-You: an appliance is in once it has echoed what a router sent'
-# shellcheck disable=SC2086
-operate a2 group add 51 interface eth0 $routers weight 100 assign hash
-lab_sleep 1.2 # a1 hears of a2 with its own second I-See-You when a2 speaks first; otherwise ten seconds later
-# shellcheck disable=SC2086
-operate a1 group add 51 interface eth0 $routers weight 60 assign hash
-await 30 11 'both appliances at both routers' members_are 51 4
+browse
+tell_step 'Here-I-Am, I-See-You: an appliance is in once it has echoed what the router sent'
+for a in a2 a1; do
+    operate $a group add 51 interface eth0 router ${address[r1]} weight "${weight[$a]}" assign hash
+    operate $a intercept add 51 port 80 to 3129 interval 2 fall 2 rise 1
+    [ $a = a1 ] || lab_sleep 1.2 # a1 hears of a2 with its own second I-See-You when a2 speaks first; else ten seconds later
+done
+await 30 11 'both appliances at the router' members_are 2
 tell_step 'a1 has the lowest address: it is elected, and makes the table'
-await 40 17 'the first hash table' group_is 51 "$shares == [37, 62]"
+await 40 17 'the first hash table' group_is "$shares == [37, 62]"
 fact 51
-
-tell_step 'A second group by mask: Here-I-Am, I-See-You'
-# shellcheck disable=SC2086
-operate a2 group add 52 interface eth0 $routers assign mask mask-dst-ip 0x3f
-lab_sleep 1.2
-# shellcheck disable=SC2086
-operate a1 group add 52 interface eth0 $routers assign mask mask-dst-ip 0x3f
-await 30 11 'both appliances at both routers' members_are 52 4
-tell_step 'a1 is elected here too; meanwhile the operator gives a2 more of group 51'
-operate a2 group set 51 weight 180
-await 40 17 'the first mask table' group_is 52 "$shares == [50, 50]"
-fact 52
-tell_step 'a1 hears of the weight with an I-See-You, and makes a new table of group 51'
-await 40 2 'the hash table by the new weights' group_is 51 "$shares == [25, 75]"
-fact 51
-
-tell_step 'a1 dies without a word; the routers send it traffic for 25 s more, then ask'
+await 10 1 'pages from both proxies' pages_are '.proxies | .a1 > 0 and .a2 > 0 and (has("") | not)'
 typed=('' '')
+browse
+lab_ctl r1 traffic >"$LAB/traffic"
+say "  r1: $(jq -r '.appliances | (map(.flows) | add) as $all | to_entries | map("\(.key) \(.value.flows) flows (\(100 * .value.flows / $all | round)%)") | join(", ")' "$LAB/traffic"); weights ${weight[a1]} and ${weight[a2]}"
+
+tell_step 'The proxy of a1 is killed: a1 gives its flows back, and they go to the server'
+lab_stop a1 proxy KILL
+browse
+await 20 4 'the health check of a1' eval "lab_in a1 $WCCP_BIN/mgmtctl --json intercept show 51 | jq -e '[.. | .proxy? // empty] == [\"down\"]' >/dev/null"
+browse
+tell_step 'It starts again'
+lab_proxy a1
+await 20 2 'pages from both proxies' pages_are '.proxies | .a1 > 0 and .a2 > 0 and (has("") | not)'
+browse
+
+tell_step 'a1 dies without a word; the router sends it its share for 25 s more, then asks'
 lab_kill a1
-await 45 25 'a Removal Query of the routers' asked
-tell_step 'No answer: the routers drop a1'
-await 20 5 'the end of its memberships' members_are 51 2
+await 45 25 'a Removal Query of the router' asked
+browse
+tell_step 'No answer: the router drops a1, and routes what it had'
+await 20 5 'the end of its membership' members_are 1
+browse
+tell_step 'a2 hears of it with its next I-See-You, is elected, and makes a table'
+await 60 27 'the first hash table of a2' group_is ".designated and ($shares == [100])"
 fact 51
-tell_step 'a2 hears of it with its next I-See-You'
-await 30 10 'the election of a2' eval 'group_is 51 .designated && group_is 52 .designated'
-tell_step 'a2 is elected, and makes tables of its own'
-await 40 17 'the first hash table of a2' group_is 51 "$shares == [100]"
-await 40 1 'the mask table of a2' group_is 52 "$shares == [100]"
-fact 51
-fact 52
+await 10 1 'all pages from a2' pages_are '.failed == 0 and (.proxies | keys == ["a2"])'
+browse
 live ends
 [ -z "$capture" ] || { lab_capture_end; chmod a+r "$capture"; say "packets: $capture"; }
 say "$survivor# mgmtctl show"
