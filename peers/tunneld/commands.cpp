@@ -7,13 +7,12 @@
 // an id whose delete was lost, replaces what was there.
 #include "peers/tunneld/commands.h"
 
-#include <arpa/inet.h>
-
 #include <cerrno>
 #include <ctime>
 
 #include <nlohmann/json.hpp>
 
+#include "peers/tunneld/link_names.h"
 #include "platform/tunnel_mailbox.h"
 #include "runtime/cmem.h"
 
@@ -211,12 +210,6 @@ bool take_command(command_desk *desk, bool *out_end) {
     }
     print_command(*desk, command, result);
     return true;
-}
-
-std::string address_text(uint32_t host_order) {
-    const in_addr wire = {htonl(host_order)};
-    char text[INET_ADDRSTRLEN];
-    return inet_ntop(AF_INET, &wire, text, sizeof text);
 }
 
 void print_line(const command_desk &desk, const nlohmann::ordered_json &line, const std::string &text) {

@@ -61,4 +61,3 @@ int64_t mailbox_pause_ms(bool attached, int64_t quiet_ms);
 void print_roles(command_desk *desk);
 // One line to `out`: the object, or the text.
 void print_line(const command_desk &desk, const nlohmann::ordered_json &line, const std::string &text);
-std::string address_text(uint32_t host_order);

@@ -1,5 +1,7 @@
 #include "peers/tunneld/sorting_text.h"
 
+#include "peers/tunneld/link_names.h"
+
 #include <algorithm>
 #include <cctype>
 #include <cstdio>
@@ -338,10 +340,6 @@ bool check_sorting(const wanted_sorting &wanted, std::string *out_error) {
 }
 
 } // namespace
-
-std::string address_text(uint32_t address) {
-    return format("%u.%u.%u.%u", address >> 24, address >> 16 & 255, address >> 8 & 255, address & 255);
-}
 
 bool make_sorting_content(const wanted_sorting &wanted, nft_content *out, std::string *out_error) {
     *out = {};

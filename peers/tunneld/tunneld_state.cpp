@@ -3,6 +3,7 @@
 
 #include "mgmt/bnode_types.h"
 #include "mgmt/node_paths.h"
+#include "peers/tunneld/link_names.h"
 #include "peers/tunneld/tunneld.h"
 #include "runtime/ttime.h"
 
