@@ -104,7 +104,7 @@ std::set<std::string> describe(const wanted_state &wanted) {
         std::string line = "group " + std::to_string(group.group);
         for (const auto &name : group.interfaces)
             line += " " + name;
-        lines.insert(line);
+        lines.insert(line + (group.rules.to ? "" : " unwanted"));
     }
     lines.insert("mss " + std::to_string(sorting.mss) + (sorting.drop_outer_gre ? " outer dropped" : ""));
     return lines;
@@ -135,10 +135,11 @@ const wanted_case wanted_cases[] = {
     {"neither an intercept without a group nor one of a group without packets",
      [](appliance_view *view) {
          view->intercepts[70] = view->intercepts[61];
+         view->groups[62] = view->groups[61];
          view->groups[61].local = OTHER;
      },
      {"mss 1432 outer dropped"},
-     {"group 61", "group 61 wccp0", "group 70"}},
+     {"group 61", "group 61 wccp0", "group 70", "group 62 wccp0 unwanted"}},
     {"nothing known",
      [](appliance_view *view) { *view = {}; },
      {"mss 0 outer dropped"},
@@ -163,8 +164,8 @@ const wanted_case wanted_cases[] = {
          view->groups[62] = view->groups[61];
          view->groups[62].routers[0].give_back = travel::l2;
      },
-     {"route 204801 wccp0"},
-     {"group 62 wccp0"}},
+     {"route 204801 wccp0", "group 61 wccp0", "group 62 wccp0 unwanted"},
+     {}},
     {"L2 return forced by one of two",
      [](appliance_view *view) {
          view->groups[62] = view->groups[61];

@@ -79,9 +79,13 @@ void read_counters(plane_counters *inout) {
     std::vector<found_link> links;
     if (find_links(true, &links))
         return;
-    for (const auto &link : links)
-        if (link.kind == "gre" && link_number(link.name))
-            inout->links[link.name] = link.counters;
+    for (auto &link : links) {
+        if (link.kind != "gre" || !link_number(link.name))
+            continue;
+        link_counters &counters = inout->links[link.name];
+        link.counters.fragments = counters.fragments; // counted by the sorting rules: here packets are whole
+        counters = link.counters;
+    }
 }
 
 } // namespace

@@ -187,24 +187,39 @@ void want_l2_interfaces(const appliance_view &view, const link_numbers &numbers,
     }
 }
 
-void want_sorting(const appliance_view &view, const link_numbers &numbers, wanted_sorting *out) {
-    for (const auto &[id, rules] : view.intercepts) {
-        const auto group = view.groups.find(id);
-        if (group == view.groups.end())
+// The interfaces that a group's packets come in by.
+std::vector<std::string> group_interfaces(const appliance_view &view, const group_view &group,
+                                          const link_numbers &numbers) {
+    std::vector<std::string> names;
+    for (const auto &[ends, tunnel] : group_links(view, group))
+        names.push_back(link_name(numbers.at(ends)));
+    if (redirects_by_l2(group))
+        names.push_back(group.interface);
+    return names;
+}
+
+// Groups with an intercept, and those that share an interface with one: without a wish of their own, they
+// keep their packets from being dropped or forwarded for another group.
+void want_groups(const appliance_view &view, const link_numbers &numbers, std::vector<sorted_group> *out) {
+    std::map<uint8_t, std::vector<std::string>> others;
+    std::set<std::string> intercepted;
+    for (const auto &[id, group] : view.groups) {
+        const auto names = group_interfaces(view, group, numbers);
+        const auto rules = view.intercepts.find(id);
+        if (rules == view.intercepts.end() || names.empty()) {
+            others[id] = names;
             continue;
+        }
         const auto condition = view.conditions.find(id);
-        sorted_group sorted = {
-            id, rules, condition == view.conditions.end() ? intercept_condition{} : condition->second, {}};
-        for (const auto &[ends, tunnel] : group_links(view, group->second))
-            sorted.interfaces.push_back(link_name(numbers.at(ends)));
-        if (redirects_by_l2(group->second))
-            sorted.interfaces.push_back(group->second.interface);
-        if (!sorted.interfaces.empty())
-            out->groups.push_back(sorted);
+        out->push_back({id, rules->second,
+                        condition == view.conditions.end() ? intercept_condition{} : condition->second,
+                        names});
+        intercepted.insert(names.begin(), names.end());
     }
-    for (const auto &entry : view.bypasses)
-        out->bypasses.push_back(entry.prefix);
-    out->own_addresses = view.own_addresses;
+    for (const auto &[id, names] : others)
+        if (std::any_of(names.begin(), names.end(),
+                        [&](const std::string &name) { return intercepted.count(name) > 0; }))
+            out->push_back({id, {}, {}, names});
 }
 
 } // namespace
@@ -235,7 +250,10 @@ wanted_state make_wanted_state(const appliance_view &view, const std::vector<wan
         wanted.settings.push_back({"all/send_redirects", "0", true});
     }
     std::sort(wanted.rules.begin(), wanted.rules.end());
-    want_sorting(view, numbers, &wanted.sorting);
+    want_groups(view, numbers, &wanted.sorting.groups);
+    for (const auto &entry : view.bypasses)
+        wanted.sorting.bypasses.push_back(entry.prefix);
+    wanted.sorting.own_addresses = view.own_addresses;
     wanted.sorting.drop_outer_gre = user_space;
     return wanted;
 }
