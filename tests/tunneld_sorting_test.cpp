@@ -14,9 +14,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <functional>
 
 #include "peers/tunneld/nft_commands.h"
@@ -560,28 +560,27 @@ TEST_F(Sorting, ManyLinksAndGroupsAreQuick) {
                 if (!different || (i >> link % 8 & 1) != link / 8 % 2)
                     wanted.groups[i].interfaces.push_back("wccp" + std::to_string(link));
         }
-        const auto timed = [&](const char *what, int64_t limit_ms) {
-            const auto begin = std::chrono::steady_clock::now();
-            apply(wanted);
-            const std::chrono::duration<double, std::milli> took = std::chrono::steady_clock::now() - begin;
-            printf("%s%s: %.1f ms\n", what, different ? ", all different" : "", took.count());
-            EXPECT_LT(took.count(), limit_ms) << what;
+        // Processor time, the kernel's with it: other programs may have the machine.
+        const auto timed = [&](const char *what, double limit_ms, const std::function<void()> &act) {
+            const clock_t begin = clock();
+            act();
+            const double ms = 1000.0 * static_cast<double>(clock() - begin) / CLOCKS_PER_SEC;
+            printf("%s%s: %.1f ms\n", what, different ? ", all different" : "", ms);
+            EXPECT_LT(ms, limit_ms) << what;
         };
-        timed("first", 2000);
+        const auto apply_it = [&] { apply(wanted); };
+        timed("first", 1000, apply_it);
         EXPECT_EQ(send({.port = 1000 + 10 * 129}), "answer");
         for (const bool up : {false, true}) {
             wanted.groups[129].condition.proxy_up = up;
-            timed("a proxy up or down", 500);
+            timed("a proxy up or down", 300, apply_it);
         }
         EXPECT_EQ(send({.port = 1000 + 10 * 129}), "answer");
         wanted.bypasses.push_back({CLIENT, 32});
-        timed("a bypass", 500);
+        timed("a bypass", 300, apply_it);
         EXPECT_EQ(send({.port = 1000 + 10 * 129}), "wccp0");
         std::string error;
-        const auto begin = std::chrono::steady_clock::now();
-        counters();
-        printf("reading: %.1f ms\n",
-               std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - begin).count());
+        timed("reading", 1000, [] { counters(); });
         EXPECT_TRUE(remove_sorting_rules(&error)) << error;
     }
 }

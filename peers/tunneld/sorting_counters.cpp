@@ -9,8 +9,9 @@
 
 namespace {
 
-bool read_address(const std::string &text, uint32_t *out) {
-    in_addr address;
+bool read_address(const nlohmann::json &value, uint32_t *out) {
+    const std::string text = value.is_string() ? value.get<std::string>() : "";
+    in_addr address{};
     if (inet_pton(AF_INET, text.c_str(), &address) != 1)
         return false;
     *out = ntohl(address.s_addr);
@@ -65,10 +66,9 @@ bool list_pairs(const char *set, std::map<std::pair<uint32_t, uint32_t>, uint64_
         for (const nlohmann::json &element : object["set"]["elem"]) {
             const bool counts = element.contains("elem");
             const nlohmann::json &value = counts ? element["elem"].value("val", nlohmann::json()) : element;
-            uint32_t source, destination;
-            if (!value.contains("concat") || value["concat"].size() != 2 ||
-                !read_address(value["concat"][0].get<std::string>(), &source) ||
-                !read_address(value["concat"][1].get<std::string>(), &destination))
+            uint32_t source = 0, destination = 0;
+            if (!value.is_object() || !value.contains("concat") || value["concat"].size() != 2 ||
+                !read_address(value["concat"][0], &source) || !read_address(value["concat"][1], &destination))
                 continue;
             (*out)[{source, destination}] = counts && element["elem"].contains("counter")
                                                 ? read_count(element["elem"]["counter"]).packets

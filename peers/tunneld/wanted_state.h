@@ -47,7 +47,8 @@ struct wanted_setting { // below /proc/sys/net/ipv4/conf
     auto operator<=>(const wanted_setting &) const = default;
 };
 
-// Redirected packets of one group.
+// Redirected packets of one group. A group without an intercept has `rules.to` 0: where it shares an
+// interface with groups that forward or drop what nobody wants, that is returned after all.
 struct sorted_group {
     uint8_t group;
     intercept rules;
