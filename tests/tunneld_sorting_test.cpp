@@ -38,7 +38,7 @@ struct packet {
 
 uint16_t checksum(const std::string &bytes, uint32_t sum = 0) {
     for (size_t i = 0; i < bytes.size(); i++)
-        sum += static_cast<uint8_t>(bytes[i]) << (i % 2 ? 0 : 8);
+        sum += static_cast<uint32_t>(static_cast<uint8_t>(bytes[i])) << (i % 2 ? 0 : 8);
     while (sum >> 16)
         sum = (sum & 0xffff) + (sum >> 16);
     return static_cast<uint16_t>(~sum);
@@ -81,7 +81,7 @@ std::string make_bytes(const packet &what) {
         const bool syn = what.flags & SYN;
         put(body, what.sequence, 4);
         put(body, what.acknowledged, 4);
-        put(body, (syn ? 6 : 5) << 12 | what.flags, 2);
+        put(body, (syn ? 6u : 5u) << 12 | what.flags, 2);
         put(body, 65535, 2);
         put(body, 0, 4);
         if (syn)
@@ -523,11 +523,11 @@ TEST_F(Sorting, ChangesAreWholeOrNone) {
     EXPECT_EQ(send({}), "wccp0");
     EXPECT_EQ(counters().groups[5][SORTED_TO_PROXY].packets, 3);
 
-    for (const bool changed : {false, true}) {
+    for (int round = 0; round < 2; round++) { // with a difference to make, then without
         ASSERT_TRUE(run_nft("flush ruleset", &error)) << error;
-        wanted.groups[0].condition.proxy_up = changed;
+        wanted.groups[0].condition.proxy_up = true;
         apply(wanted);
-        EXPECT_EQ(send({}), changed ? "answer" : "wccp0");
+        EXPECT_EQ(send({}), "answer");
     }
     // A table of that name with something else in it gives way.
     EXPECT_TRUE(remove_sorting_rules(&error)) << error;
