@@ -22,7 +22,7 @@ enum mode : uint8_t {
     UDP_MERGED = 4, // the device takes large UDP packets
     FLUSHED = 8,    // after each fifth frame
 };
-constexpr size_t MAX_FRAMES = 300;
+constexpr size_t MAX_FRAMES = 300, MAX_FRAME_BYTES = 100000; // more than one large packet holds
 using bytes = std::vector<uint8_t>;
 
 void require(bool condition, const char *what) {
@@ -202,6 +202,7 @@ void take_frames(uint8_t mode, const uint8_t *data, size_t size) {
     std::vector<exact_memory> frames; // stay until the flush
     bytes gre;
     uint64_t accepted = 0;
+    size_t carried = 0;
     while (size >= 2 && frames.size() < MAX_FRAMES) {
         const size_t head = static_cast<size_t>(data[0]) << 8 | data[1];
         data += 2;
@@ -215,7 +216,8 @@ void take_frames(uint8_t mode, const uint8_t *data, size_t size) {
             data += length;
             size -= length;
         }
-        for (; times > 0 && frames.size() < MAX_FRAMES; times--) {
+        for (; times > 0 && frames.size() < MAX_FRAMES && carried < MAX_FRAME_BYTES; times--) {
+            carried += gre.size();
             if (head & 0x8000)
                 advance(&gre);
             if (mode & MENDED)

@@ -14,6 +14,7 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <string>
@@ -307,7 +308,7 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
 // --- live: this process is the appliance, a child in a network namespace of its own the router
 
 constexpr uint32_t APPLIANCE = 0x0a000001, ROUTER = 0x0a000002, STRANGER = 0x0a000003;
-constexpr size_t TRANSFER = 24 << 20;
+constexpr size_t TRANSFER = 24 << 20, LARGE_DATAGRAM = 30000;
 
 void shell(const std::string &command) {
     ASSERT_EQ(system(command.c_str()), 0) << command;
@@ -337,6 +338,10 @@ int send_by_hand() {
     const bytes packet = make_packet(PROTOCOL_UDP, 1, 1472), redirect = {0x80, 51, 7, 200};
     send_gre(STRANGER, wrap(0, GRE_TYPE_IPV4, packet));
     send_gre(ROUTER, wrap(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}));
+    bytes large = make_packet(PROTOCOL_UDP, 2, LARGE_DATAGRAM); // no frame of the ring holds it
+    ip(&large)->destination = to_be32(0xc0a80901);
+    mend(&large);
+    send_gre(ROUTER, wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, large));
     send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, packet, redirect));
     pollfd waits = {back, POLLIN, 0};
     uint8_t got[2048];
@@ -463,6 +468,20 @@ bool transfer(uint32_t *out_retransmissions) {
     return connected && back == sent;
 }
 
+// Of all threads of this process.
+long wake_ups() {
+    long sum = 0;
+    for (const auto &task : std::filesystem::directory_iterator("/proc/self/task")) {
+        std::ifstream status(task.path() / "status");
+        for (std::string word; status >> word;) {
+            long count = 0;
+            if (word == "voluntary_ctxt_switches:" && status >> count)
+                sum += count;
+        }
+    }
+    return sum;
+}
+
 TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     std::string error;
     uint32_t index = 0, again = 0, retransmissions = 0;
@@ -479,13 +498,20 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     std::ofstream("/proc/sys/net/ipv4/conf/wccp0/forwarding") << 1;
     std::ofstream("/proc/sys/net/ipv4/conf/wccp0/send_redirects") << 0;
 
+    const int datagrams = socket(AF_INET, SOCK_DGRAM | SOCK_NONBLOCK, 0);
+    const sockaddr_in any = address_of(INADDR_ANY, 80);
+    ASSERT_EQ(bind(datagrams, reinterpret_cast<const sockaddr *>(&any), sizeof any), 0);
+
     // What the router redirects and nobody wants goes back with its redirect header.
     order('h');
     EXPECT_TRUE(answered());
     plane_counters counters;
     user_plane.read_counters(&counters);
-    EXPECT_EQ(counters.links["wccp0"].packets_in, 1u);
-    EXPECT_EQ(counters.links["wccp0"].bytes_in, 1500u);
+    EXPECT_EQ(counters.links["wccp0"].packets_in, 2u);
+    EXPECT_EQ(counters.links["wccp0"].bytes_in, 1500u + LARGE_DATAGRAM + 28);
+    bytes datagram(LARGE_DATAGRAM + 1);
+    EXPECT_EQ(recv(datagrams, datagram.data(), datagram.size(), 0), static_cast<ssize_t>(LARGE_DATAGRAM));
+    close(datagrams);
     EXPECT_EQ(counters.links["wccp0"].packets_out, 1u);
     EXPECT_EQ(counters.links["wccp0"].refused[REFUSED_FLAGS], 1u);
     EXPECT_EQ(counters.refused[REFUSED_SOURCE], 1u);
@@ -511,6 +537,16 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     order('e');
     EXPECT_TRUE(transfer(&retransmissions));
     EXPECT_TRUE(answered());
+
+    // One that somebody has deleted is made anew; until then the thread sleeps.
+    shell("ip link del wccp0");
+    usleep(100000);
+    const long before = wake_ups();
+    usleep(300000);
+    EXPECT_LE(wake_ups() - before, 5);
+    ASSERT_TRUE(user_plane.make_link("wccp0", wish, &again, &error)) << error;
+    EXPECT_EQ(again, if_nametoindex("wccp0"));
+    shell("ip link set wccp0 up");
 }
 
 } // namespace

@@ -17,7 +17,7 @@
 namespace {
 
 // A frame holds a full packet of 1500 bytes in its GRE header and everything before it.
-constexpr uint32_t FRAME_SIZE = 2048, FRAMES = 4096, BLOCK_SIZE = 64 * 1024;
+constexpr uint32_t FRAME_SIZE = 2048, FRAMES = 8192, BLOCK_SIZE = 64 * 1024;
 constexpr size_t RING_SIZE = size_t{FRAME_SIZE} * FRAMES;
 constexpr size_t LARGE_SIZE = sizeof(virtio_header) + 256 + IP4_MAX_PACKET; // with a link-layer header
 constexpr int LARGE_QUEUE = 4 << 20; // bytes of large packets that wait
@@ -141,14 +141,11 @@ bool ring_next(packet_ring *ring, ring_packet *out) {
     ring->held++;
     *out = {};
     const size_t link = frame->tp_mac, network = frame->tp_net, size = frame->tp_snaplen;
-    if (link < sizeof out->header || network < link || network - link > size || link + size > FRAME_SIZE) {
-        out->lost = true;
-        return true;
-    }
-    const size_t link_header = network - link;
+    const size_t link_header = network > link ? network - link : 0;
     if (status & TP_STATUS_COPY) {
         fetch_large(ring, link_header, out);
-    } else if (frame->tp_len > size) {
+    } else if (link < sizeof out->header || network < link || link_header > size ||
+               link + size > FRAME_SIZE || frame->tp_len > size) {
         out->lost = true;
     } else {
         uint8_t *const bytes = reinterpret_cast<uint8_t *>(frame_at(ring, ring->next + FRAMES - 1));

@@ -23,6 +23,18 @@ bool fail(std::string *out_error, const std::string &what) {
     return false;
 }
 
+// A process that has just ended, or a thread that polls, may hold the device for a moment yet.
+bool attach(int fd, ifreq *request) {
+    for (int tries = 0; tries < 20; tries++) {
+        if (ioctl(fd, TUNSETIFF, request) == 0)
+            return true;
+        if (errno != EBUSY)
+            break;
+        usleep(2000);
+    }
+    return false;
+}
+
 bool set_up_device(int fd, const std::string &name, tun_device *out, std::string *out_error) {
     ifreq request = {};
     if (name.size() >= sizeof request.ifr_name) {
@@ -31,7 +43,7 @@ bool set_up_device(int fd, const std::string &name, tun_device *out, std::string
     }
     memcpy(request.ifr_name, name.c_str(), name.size() + 1);
     request.ifr_flags = IFF_TUN | IFF_NO_PI | IFF_VNET_HDR;
-    if (ioctl(fd, TUNSETIFF, &request) != 0)
+    if (!attach(fd, &request))
         return fail(out_error, "TUN device " + name);
     int header = sizeof(virtio_header);
     if (ioctl(fd, TUNSETVNETHDRSZ, &header) != 0)
