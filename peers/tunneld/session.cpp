@@ -193,13 +193,20 @@ state_tree tree_of(const std::vector<state_node> &nodes) {
     return out;
 }
 
+// Such a node is there so that it can be listed; its value is its own last part.
+bool is_one_of_many(const node_name &name) {
+    static const node_name patterns[] = {parsed_name(NODE_TUNNEL_STATE "/*"),
+                                         parsed_name(NODE_INTERCEPT_STATE "/*")};
+    return std::any_of(std::begin(patterns), std::end(patterns),
+                       [&](const node_name &pattern) { return matches(pattern, name); });
+}
+
 lc_status get_state(const char *name, const tstr_array *, void *data, bn_binding_array *out) {
     const auto *tree = static_cast<const state_tree *>(data);
     const node_name wanted = parsed_name(name);
     const auto found = tree->find(wanted);
-    if (found == tree->end())
+    if (found == tree->end() || (!found->second && !is_one_of_many(wanted)))
         return LC_OK;
-    // One of many is listed by its own last part, as its value.
     const node_value value = found->second ? node_value{found->second->type, found->second->text}
                                            : node_value{bn_type_str, wanted.parts.back()};
     owned_binding binding(make_binding(name, value));
