@@ -2,7 +2,6 @@
 // is no use without a group that fits is noted, and done all the same: the group may come later.
 #include "peers/mgmtctl/intercepts.h"
 
-#include <cstdlib>
 #include <map>
 #include <optional>
 
@@ -185,23 +184,6 @@ static std::string instance_name(const char *above, const std::string &part) {
     return parsed_name(above).below(part).text();
 }
 
-// Somebody else may delete them at the same time.
-static void delete_ended(const ctl_link &link, int64_t now) {
-    traffic_result unused;
-    node_texts nodes;
-    std::vector<ctl_change_item> items;
-    if (!read_nodes(link, NODE_BYPASS_CONFIG, &nodes, &unused))
-        return;
-    for (const auto &[name, value] : nodes)
-        if (name.ends_with("/until") && value != "0" && std::atoll(value.c_str()) <= now)
-            items.push_back(
-                {ctl_change::remove, {NODE_BYPASS_CONFIG "/" + name.substr(0, name.rfind('/')), "", ""}});
-    ctl_reply reply;
-    std::string reason;
-    if (!items.empty())
-        (void)link.set(items, &reply, &reason);
-}
-
 traffic_result bypass_command(const ctl_link &link, const std::vector<std::string> &words, int64_t now) {
     static const char *const USAGE = "bypass add PREFIX [for SECONDS], bypass delete PREFIX, bypass show";
     traffic_result result;
@@ -234,8 +216,6 @@ traffic_result bypass_command(const ctl_link &link, const std::vector<std::strin
         return result;
     commit(link, changes(root, {{"until", std::to_string(until)}}, before),
            before.empty() ? "added" : "changed", &result);
-    if (result.exit == CTL_OK)
-        delete_ended(link, now);
     return result;
 }
 

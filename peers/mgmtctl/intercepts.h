@@ -20,8 +20,7 @@ struct traffic_result {
 
 // `words` follow "intercept", "bypass" and "tunnel". Each command is one commit.
 traffic_result intercept_command(const ctl_link &link, const std::vector<std::string> &words);
-// `now` in seconds since 1970. Bypasses whose time is over are deleted along with an "add", in a commit of
-// their own that may fail.
+// `now` in seconds since 1970. mgmtd deletes a bypass whose time is over.
 traffic_result bypass_command(const ctl_link &link, const std::vector<std::string> &words, int64_t now);
 traffic_result tunnel_command(const ctl_link &link, const std::vector<std::string> &words);
 
