@@ -343,7 +343,7 @@ TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
               "refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
               "packets come in fragments, and the MSS of no flow has been clamped\n");
     EXPECT_EQ(printed([&] { return tell_intercepts(options, link, ""); }, CTL_OK),
-              "51 port 80 443 to 3128 check http /a\n  proxy down 0:10:40\n"
+              "51 port 80 443 to 3128 check http /a\n  proxy down 0:10:40: refused?[2J\n"
               "  in 120  to proxy 100  returned 12  proxy down 8\n"
               "  group 51 has left its routers: no good check for 30 s\n");
     options.json = true;

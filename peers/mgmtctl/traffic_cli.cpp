@@ -55,6 +55,9 @@ static int tell_result(const ctl_options &options, const traffic_result &result)
 // --- What is there
 
 namespace {
+// The nodes below each instance by their names, by the instance's own name.
+using instance_list = std::vector<std::pair<std::string, std::map<std::string, std::string>>>;
+
 // Walks of one command, which ends with the first failure.
 struct asking {
     ctl_link link;
@@ -71,9 +74,8 @@ struct asking {
                                      ctl_reply *reply) { return ask(walk, name, reply); },
                               out);
     }
-    // What is configured below `root`: the nodes of each instance by its name.
-    bool ask_configuration(const char *root,
-                           std::vector<std::pair<std::string, std::map<std::string, std::string>>> *out) {
+    // What is configured below `root`.
+    bool ask_configuration(const char *root, instance_list *out) {
         ctl_reply reply;
         if (!ask(ctl_walk::subtree, root, &reply))
             return false;
@@ -101,7 +103,7 @@ static void put_absence(tunneld_condition condition) {
 
 static void put_reasons(const std::vector<traffic_reason> &reasons, int group) {
     for (const traffic_reason &reason : reasons)
-        if (reason.group == group)
+        if (reason.group == group && reason.word != "proxy_down") // has been said with the proxy
             put((group < 0 ? "" : "  ") + reason.text + "\n");
 }
 
@@ -130,7 +132,7 @@ static ctl_json intercept_json(const std::string &number, const std::map<std::st
 
 int tell_intercepts(const ctl_options &options, const ctl_link &link, const std::string &only) {
     asking mgmtd = {link};
-    std::vector<std::pair<std::string, std::map<std::string, std::string>>> intercepts;
+    instance_list intercepts;
     traffic_state traffic;
     if (!mgmtd.ask_configuration(NODE_INTERCEPT_CONFIG, &intercepts) || !mgmtd.ask_traffic(&traffic))
         return tell_failure(options, mgmtd.failure);
@@ -149,7 +151,9 @@ int tell_intercepts(const ctl_options &options, const ctl_link &link, const std:
             continue;
         put(number + " " + intercept_clauses(nodes) + "\n");
         if (state)
-            put("  " + proxy_text(*state) + "\n  " + sorted_text(state->sorted) + "\n");
+            put("  " + proxy_text(*state) +
+                (state->proxy == "up" || state->proxy_reason.empty() ? "" : ": " + state->proxy_reason) +
+                "\n  " + sorted_text(state->sorted) + "\n");
         put_reasons(reasons, std::atoi(number.c_str()));
     }
     if (options.json)
@@ -188,7 +192,7 @@ int ctl_intercept(const ctl_options &options, const std::vector<std::string> &wo
 
 int tell_bypasses(const ctl_options &options, const ctl_link &link) {
     asking mgmtd = {link};
-    std::vector<std::pair<std::string, std::map<std::string, std::string>>> bypasses;
+    instance_list bypasses;
     traffic_state traffic;
     if (!mgmtd.ask_configuration(NODE_BYPASS_CONFIG, &bypasses) || !mgmtd.ask_traffic(&traffic))
         return tell_failure(options, mgmtd.failure);
