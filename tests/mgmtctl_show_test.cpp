@@ -271,7 +271,7 @@ static void add_traffic(canned *from, const char *lines) {
 static const char *const TRAFFIC =
     "P/name kernel|P/reason ip_gre is there|P/clamped 0|P/refused/source 9|P/refused_source/10.0.0.9 9|"
     "T/3 3|T/3/local 10.0.0.101|T/3/remote 10.0.0.1|T/3/interface wccp0|T/3/index 12|T/3/packets_in 1234567|"
-    "T/3/bytes_in 999999999|T/3/fragments 4|T/3/refused/flags 2|T/3/in 7|T/3/own 3|"
+    "T/3/bytes_in 999999999|T/3/fragments 4|T/3/refused/flags 2|T/3/in 7|T/3/own 3|P/own 3|"
     "I/51 51|I/51/proxy down|I/51/proxy_reason refused\033[2J|I/51/proxy_ms 640000|I/51/active "
     "true|I/51/left true|"
     "I/51/in 120|I/51/in_bytes 9000|I/51/to_proxy 100|I/51/returned 12|I/51/down 8|"

@@ -1,6 +1,6 @@
 #!/bin/bash
-# mgmtd starts the appliance's programs and keeps them: both sessions open, a crash of tunneld ends wccpd in order and
-# brings both back, a file edited by hand reaches wccpd, a program that doesn't end is made to, and nothing outlives a
+# mgmtd starts the appliance's programs and keeps them: both sessions open, a tunneld that crashes is replaced
+# unnoticed, one that is ended takes wccpd with it and both come back, a file edited by hand reaches wccpd, a program that doesn't end is made to, and nothing outlives a
 # mgmtd that is killed.
 #   scenario_supervise.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
@@ -37,8 +37,14 @@ pid_of() { sed -n "s/^process $1: started, pid //p" $out | tail -n 1; }
 
 start
 first=$(pid_of wccpd)
+says 10 1 "^session of tunneld-[0-9]+ open"
+sleep 0.6 # a run that is shorter counts as one that failed to start
 kill -KILL "$(pid_of tunneld)"
-says 10 1 "^process tunneld: /pm/events/failure/crash"
+says 10 1 "^process tunneld: ended by SIGKILL, replaced after [0-9]+ ms"
+says 10 2 "^session of tunneld-[0-9]+ open"
+[ "$(pid_of wccpd)" = "$first" ] && kill -0 "$first" || die "wccpd has noticed"
+kill -TERM "$(pid_of tunneld)"
+says 10 1 "^process tunneld: /pm/events/proc/terminate"
 says 10 1 "^process wccpd: exited with 0, starts again in 1 s"
 says 20 4 "^session of wccpd-[0-9]+ open"
 [ "$(pid_of wccpd)" != "$first" ] || die "wccpd is the same"

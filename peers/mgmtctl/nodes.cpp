@@ -36,14 +36,15 @@ static std::string number_of(const std::string &root) {
 static const std::vector<node_name> &patterns() {
     static const std::vector<node_name> all = [] {
         std::vector<node_name> made;
-        made.reserve(schema().size() + wccpd_state_nodes().size());
+        made.reserve(schema().size() + wccpd_state_nodes().size() + tunneld_state_nodes().size());
         for (const schema_row &row : schema())
             made.push_back(row.parts);
-        for (const char *pattern : wccpd_state_nodes())
-            made.push_back(parsed_name(pattern));
-        for (const char *pattern :
-             {NODE_ALARMS_RAISED "/*/*/name", NODE_ALARMS_RAISED "/*/*/since",
-              NODE_ALARMS_RAISED "/*/*/reporter", NODE_ROLES "/*/code", NODE_ROLES "/*/since"})
+        for (const auto *states : {&wccpd_state_nodes(), &tunneld_state_nodes()})
+            for (const char *pattern : *states)
+                made.push_back(parsed_name(pattern));
+        for (const char *pattern : {NODE_ALARMS_RAISED "/*/*/name", NODE_ALARMS_RAISED "/*/*/since",
+                                    NODE_ALARMS_RAISED "/*/*/reporter", NODE_ROLES "/*/code",
+                                    NODE_ROLES "/*/since", NODE_LEFT_GROUPS "/*"})
             made.push_back(parsed_name(pattern));
         return made;
     }();

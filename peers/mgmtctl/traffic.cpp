@@ -108,6 +108,8 @@ static void take_plane(const std::vector<std::string> &parts, const std::string 
         out->plane = clean_text(value, 15);
     else if (parts[0] == "reason")
         out->plane_reason = clean_text(value, 127);
+    else if (parts[0] == "own")
+        out->own = number(value);
     else if (parts[0] == "clamped")
         out->clamped = number(value);
 }
@@ -153,7 +155,7 @@ bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
     } walks[] = {
         {NODE_PLANE_STATE, true, take_plane},         {NODE_TUNNEL_STATE, true, take_tunnel},
         {NODE_INTERCEPT_STATE, true, take_intercept}, {NODE_ACCEPT_CONFIG, false, take_accepted},
-        {NODE_ALARM_STATE "/left", false, take_left},
+        {NODE_LEFT_GROUPS, false, take_left},
     };
     *out = {};
     out->tunneld = tunneld_condition::running;
@@ -215,11 +217,6 @@ std::string proxy_text(const traffic_intercept &intercept) {
 
 // --- Reasons
 
-static uint64_t packets_of(const sorted_counts &counts, const char *way) {
-    const auto found = counts.find(way);
-    return found == counts.end() ? 0 : found->second.packets;
-}
-
 namespace {
 struct reason_list {
     const char *word;
@@ -231,12 +228,7 @@ struct reason_list {
 } // namespace
 
 static void own_traffic(const traffic_state &state, const reason_list &list) {
-    uint64_t packets = 0;
-    for (const traffic_tunnel &tunnel : state.tunnels)
-        packets += packets_of(tunnel.sorted, "own");
-    for (const traffic_intercept &intercept : state.intercepts)
-        packets += packets_of(intercept.sorted, "own");
-    if (packets > 0)
+    if (state.own > 0)
         list.add("the router redirects this appliance's own traffic");
 }
 

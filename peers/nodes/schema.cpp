@@ -183,6 +183,9 @@ const std::vector<const char *> &tunneld_state_nodes() {
     static const std::vector<const char *> nodes = {
         NODE_PLANE_STATE "/name",
         NODE_PLANE_STATE "/reason",
+        NODE_PLANE_STATE "/lack",
+        NODE_PLANE_STATE "/failure",
+        NODE_PLANE_STATE "/own",
         NODE_PLANE_STATE "/clamped",
         NODE_PLANE_STATE "/refused/*",
         NODE_PLANE_STATE "/refused_source/*",

@@ -38,7 +38,6 @@ inline constexpr const char *CLAMPED_COUNTER = "clamped";
 inline constexpr const char *REFUSED_SET = "refused_sources"; // filled by a rule
 inline constexpr const char *ENDS_SET = "ends";               // elements "REMOTE . LOCAL"
 
-
 // False: a name or a number that must not reach nftables.
 bool make_sorting_content(const wanted_sorting &wanted, nft_content *out, std::string *out_error);
 // "" when there is no difference. Counters that are in both keep their values.

@@ -285,8 +285,10 @@ void look_at_mailbox(int, short, void *data) {
             daemon->tick_at_ms = now + TICK_MS;
             tick(daemon, now);
         }
-        if (take_command(&daemon->desk, &end))
+        if (take_command(&daemon->desk, &end)) {
             daemon->last_command_ms = now;
+            mgmt_link_ask_routers(daemon->management); // a new tunnel may mean a new router
+        }
         pause = mailbox_pause_ms(daemon->desk.attached, now - daemon->last_command_ms);
     }
     LOG_STATUS(loop_event_set_timer(daemon->mailbox_timer, pause));

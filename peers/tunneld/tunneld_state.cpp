@@ -121,6 +121,10 @@ std::vector<state_node> tunneld_state(const tunneld &daemon) {
     writer.add("reason", bn_type_str, daemon.plane_reason);
     writer.add("lack", bn_type_str, daemon.lack);
     writer.add("failure", bn_type_str, daemon.failure);
+    uint64_t own = 0;
+    for (const auto &[name, ways] : sorting.interfaces)
+        own += ways[SORTED_OWN].packets;
+    writer.count("own", own);
     writer.count("clamped", sorting.clamped);
     add_refused(&writer, plane.refused);
     std::map<uint32_t, uint64_t> sources = plane.refused_sources;
