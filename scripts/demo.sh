@@ -132,9 +132,9 @@ fetch_pages() { # COUNT TIMEOUT
         "of \($all) pages a1 \(.proxies.a1 // 0 | part)  a2 \(.proxies.a2 // 0 | part)  server alone \(.proxies[""] // 0 | part)  none \(.failed | part)"' \
         <<<"$fetched")
 }
-# In a line, what 128 addresses of the client get.
+# In a line, what 120 addresses of the client get.
 browse() {
-    fetch_pages 128 1
+    fetch_pages 120 1
     say "  c1: $pages"
 }
 fact() { # GROUP : in a line

@@ -35,7 +35,7 @@ groups=("$(lab_group 255 10.0.0.2)")
 for id in $(seq 51 250); do groups+=("$(lab_group $id 10.0.0.1 priority=$id)"); done
 lab_write_config a1 "${groups[@]}"
 lab_mgmtd_start a1
-lab_start a1 tunneld tunneld
+lab_tunneld_start a1
 lab_start a1 wccpd "wccpd${measured:+_timed}"
 lab_wait_role 30 a1 255 ACTIVE && lab_wait_role 30 a1 250 ACTIVE || fail "the groups don't become active"
 

@@ -39,7 +39,7 @@ expect 0 '.done == "added" and .wccpd == "absent"' group add 50 interface eth0 r
 expect 0 '.groups[0] | .configured and (.running | not) and .routers[0].connection == "none"' show
 expect 0 '.done == "deleted"' group delete 50
 expect 4 '.code == 14004' group delete 50
-lab_start a1 tunneld tunneld
+lab_tunneld_start a1
 lab_wccpd_start a1
 expect 0 '.wccpd == "running" and .status == "Ready" and .groups_total == 0' show
 

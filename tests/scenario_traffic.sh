@@ -47,6 +47,9 @@ fetches() { # JQ [OPTIONS OF lab_fetch]
 fetches_within() { # SECONDS JQ [OPTIONS OF lab_fetch]
     lab_wait "$1" "$2" eval "lab_fetch c1 --timeout 1 ${*:3} || true" || die "no fetch"
 }
+# From the clients by their addresses, and back to them.
+both_groups="$(lab_group 51 10.0.0.1 hash_src_ip=true)
+$(lab_group 52 10.0.0.1 hash_src_ip=false hash_dst_ip=true)"
 direct='.failed == 0 and (.proxies | keys == [""]) and (.peers | keys | all(startswith("10.1.0.")))'
 by() { echo ".failed == 0 and (.proxies | keys == [\"$1\"])"; }
 traffic_is() { # SECONDS JQ
@@ -58,13 +61,13 @@ traffic_is() { # SECONDS JQ
 case_gre_hash() {
     start --forward gre --return gre
     local wanted
-    wanted=$(lab_intercept 51 'ports=80 8000-8010' bypass=10.1.0.240/28)
+    wanted=$(lab_intercept 51 'ports=80 8000-8010' bypass=10.1.0.224/28)
     proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1 weight=50)" "$wanted"
     proxied a2 10.0.0.102 '' "$(lab_group 51 10.0.0.1 weight=100)" "$wanted"
     ready 51 a1 a2
     lab_ctl r1 traffic reset >/dev/null
-    fetches '.failed == 0 and .proxies[""] == 16 and (.proxies | .a1 > 25 and .a1 < 50 and .a1 + .a2 == 112) and
-        (.peers | has("10.1.0.240") and (has("10.1.0.239") | not))' --count 128 --sources 128
+    fetches '.failed == 0 and .proxies[""] == 16 and (.proxies | .a1 > 25 and .a1 < 50 and .a1 + .a2 == 96) and
+        (.peers | has("10.1.0.224") and has("10.1.0.239") and (has("10.1.0.223") | not))' --count 112 --sources 112
     fetches "$direct" --count 8 --sources 8 --port 8080
     # To a proxy packets come in one piece: it offers no more than fits. Those for the server come in two.
     fetches '.failed == 0 and .slowest < 10' --upload 5000000 --count 4 --sources 4
@@ -151,13 +154,15 @@ case_proxy_down() {
     finish a1
 }
 
-# A router that redirects the proxy's own requests as well: they reach the server, and the operator is told.
+# A router that redirects the proxy's own requests as well: they reach the server, and the operator is told. The same
+# when they look like the client's.
 case_own_traffic() {
-    start --forward gre --return gre --redirect eth0=51
-    proxied a1 10.0.0.101 "${1-}" "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
+    start --forward gre --return gre --redirect eth0=51 --redirect s1=52
+    proxied a1 10.0.0.101 "${1-}" "$both_groups" "$(lab_intercept 51 ports=80)"
     ready 51 a1
+    ready 52 a1
     fetches "$(by a1)" --count 32 --sources 32
-    state_is a1 10 intercept '.["51"].own >= 32'
+    state_is a1 10 tunnel '[.[].own] | add >= 32'
     lab_in a1 "$WCCP_BIN/mgmtctl" explain 51 | grep -q "the router redirects this appliance's own traffic" || die "not explained"
     finish a1
 }
@@ -168,11 +173,9 @@ case_own_spoofed() {
 # The proxies keep the clients' addresses; what the server answers comes to the right one by a second group.
 case_spoofed() {
     start --forward gre --return gre --redirect s1=52
-    local node groups
+    local node
     for node in 1 2; do
-        groups="$(lab_group 51 10.0.0.1 hash_src_ip=true)
-$(lab_group 52 10.0.0.1 hash_src_ip=false hash_dst_ip=true)"
-        proxied a$node 10.0.0.10$node keep "$groups" "$(lab_intercept 51 ports=80)"
+        proxied a$node 10.0.0.10$node keep "$both_groups" "$(lab_intercept 51 ports=80)"
     done
     ready 51 a1 a2
     ready 52 a1 a2

@@ -32,7 +32,7 @@ at_last() {
 case_absent() {
     start none
     refused
-    lab_start a1 tunneld tunneld
+    lab_tunneld_start a1
     at_last
 }
 case_absent_at_the_end() {
@@ -49,7 +49,7 @@ case_silent() {
     says a1 20 'GRE tunnel add timed out'
     refused
     lab_stop a1 tunneld KILL
-    lab_start a1 tunneld tunneld
+    lab_tunneld_start a1
     at_last
 }
 case_refusing() {
@@ -86,7 +86,7 @@ case_silent_at_the_start() {
     LAB_FOUND[a1]=$(lab_remains a1)
     lab_write_config a1 "$(for i in {51..60}; do lab_group "$i" 10.0.0.1; done)"
     lab_mgmtd_start a1
-    lab_start a1 tunneld tunneld --silent
+    lab_tunneld_start a1 --silent
     timed 5000 lab_wccpd_start a1
     [ "$(lab_log a1 | grep -c 'GRE tunnel L2 return add timed out')" = 10 ] || die "not said for each group"
     finish a1 -- 'GRE tunnel L2 return add timed out'

@@ -178,8 +178,10 @@ static int open_gre(address own, std::string *wrong) {
     sockaddr_in place = {};
     place.sin_family = AF_INET;
     place.sin_addr.s_addr = htonl(own);
-    const int fragments = IP_PMTUDISC_DONT, room = 8 << 20;
-    if (fd < 0 || bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0 ||
+    const int fragments = IP_PMTUDISC_DONT, room = 8 << 20, one = 1;
+    // The interface that has the address may come later.
+    if (fd < 0 || setsockopt(fd, IPPROTO_IP, IP_FREEBIND, &one, sizeof one) != 0 ||
+        bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0 ||
         setsockopt(fd, IPPROTO_IP, IP_MTU_DISCOVER, &fragments, sizeof fragments) != 0)
         *wrong = "GRE at " + text_of(own) + ": " + strerror(errno);
     for (const int which : {SO_RCVBUFFORCE, SO_SNDBUFFORCE})

@@ -376,12 +376,12 @@ int main(int argc, char **argv) {
         fputs("wccp_router: no --router\n", stderr);
         return 2;
     }
+    open_path(&all, redirect);
     const int control = control_path.empty() ? -1 : listen_at(control_path);
     if (!control_path.empty() && control < 0) {
         fprintf(stderr, "wccp_router: %s: %s\n", control_path.c_str(), strerror(errno));
         return 1;
     }
-    open_path(&all, redirect);
     all.began = seconds_now();
     run(&all, control);
     if (control >= 0)
