@@ -39,6 +39,10 @@ state() { # NODE KIND
 state_is() { # NODE SECONDS KIND JQ
     lab_wait "$2" "$4" state "$1" "$3" || die "$3 of $1"
 }
+explained() { # NODE LINE
+    lab_in "$1" "$WCCP_BIN/mgmtctl" tunnel show >"$LAB/explained"
+    grep -q "$2" "$LAB/explained" || die "not explained: $(cat "$LAB/explained")"
+}
 fetches() { # JQ [OPTIONS OF lab_fetch]
     local out
     out=$(lab_fetch c1 "${@:2}")
@@ -163,7 +167,7 @@ case_own_traffic() {
     ready 52 a1
     fetches "$(by a1)" --count 32 --sources 32
     state_is a1 10 tunnel '[.[].own] | add >= 32'
-    lab_in a1 "$WCCP_BIN/mgmtctl" explain 51 | grep -q "the router redirects this appliance's own traffic" || die "not explained"
+    explained a1 "the router redirects this appliance's own traffic"
     finish a1
 }
 case_own_spoofed() {
@@ -193,7 +197,7 @@ case_accept() {
     ready 51 a1
     fetches '.fetched == 0' --timeout 1
     state_is a1 10 plane '.refused_source["10.1.0.1"] >= 1'
-    lab_in a1 "$WCCP_BIN/mgmtctl" explain 51 | grep -q '10\.1\.0\.1' || die "not explained"
+    explained a1 'refused source 10\.1\.0\.1: mgmtctl tunnel accept 10\.1\.0\.1'
     lab_manage a1 tunnel accept 10.1.0.1 >/dev/null || die "not accepted"
     fetches_within 5 "$(by a1)" --count 4
     fetches "$direct" --count 4 --port 8080
@@ -234,7 +238,8 @@ case_kills() {
     jq -se 'length > 0 and all(.[]; .failures | keys - ["reset", "closed"] == [])' "$results" >/dev/null || die "transfers: $(cat "$results")"
     [ "$(lab_in a1 pgrep -x wccpd)" = "$wccpd" ] || die "wccpd has gone"
     # All of them at once, with their rules: the next ones take them over.
-    lab_stop a1 mgmtd KILL
+    lab_in a1 pkill -KILL -x 'mgmtd|tunneld|wccpd'
+    lab_wait_exit 5 a1 mgmtd
     supervised
     ready 51 a1
     fetches "$(by a1)" --count 4
