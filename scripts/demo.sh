@@ -4,7 +4,7 @@
 # appliances join, the designated one shares 256 hash buckets by weight, and pages that the client fetches come through
 # the proxies in these shares. Then the proxy of one is killed, and starts again; then the whole appliance dies. The
 # fetches go on. On a terminal `mgmtctl show --watch` of the appliance that survives stays on the screen, below what is
-# awaited, for how long, and by whom the last pages came; without one there is a line for each step. Takes some 70
+# awaited, for how long, and by whom the last pages came; without one there is a line for each step. Takes some 50
 # seconds, installs and builds what is missing, leaves nothing running.
 #   --capture FILE   keep the packets of the protocol and of redirected flows, for tshark or wireshark
 #   --plain          lines, on a terminal as well
@@ -248,10 +248,10 @@ await 10 1 'pages from both proxies' pages_are '.proxies | .a1 > 0 and .a2 > 0 a
 typed=('' '')
 browse
 lab_ctl r1 traffic >"$LAB/traffic"
-say "  r1: $(jq -r '.appliances | (map(.flows) | add) as $all | to_entries | map("\(.key) \(.value.flows) flows (\(100 * .value.flows / $all | round)%)") | join(", ")' "$LAB/traffic"); weights ${weight[a1]} and ${weight[a2]}"
+say "  r1: $(jq -r '{"10.0.0.101": "a1", "10.0.0.102": "a2"} as $names | .appliances | (map(.flows) | add) as $all | to_entries | map("\($names[.key]) \(.value.flows) flows (\(100 * .value.flows / $all | round)%)") | join(", ")' "$LAB/traffic"); weights ${weight[a1]} and ${weight[a2]}"
 
 tell_step 'The proxy of a1 is killed: a1 gives its flows back, and they go to the server'
-lab_stop a1 proxy KILL
+lab_stop a1 proxy KILL 2>/dev/null # no word of the shell's
 browse
 await 20 4 'the health check of a1' eval "lab_in a1 $WCCP_BIN/mgmtctl --json intercept show 51 | jq -e '[.. | .proxy? // empty] == [\"down\"]' >/dev/null"
 browse
