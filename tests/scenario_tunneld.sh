@@ -125,7 +125,12 @@ case_crash() {
     lab_start a1 mgmtd "$(command -v env)" "${LAB_CLOCK[@]:1}" "$WCCP_BIN/mgmtd" --config "$LAB_CONFIG" --supervise --wccpd "$WCCP_BIN/wccpd" --tunneld "$WCCP_BIN/tunneld"
     role a1 60 51 ACTIVE
     lab_mark a1
+    # A crash is made good unnoticed, the tunnel under its index; a tunneld that ends takes wccpd with it.
+    local before; before=$(lab_in a1 ip -o link show group 2048)
     lab_in a1 pkill -KILL -x tunneld
+    lab_wait_event 10 a1 '^process tunneld: ended by SIGKILL, replaced' || die "not replaced"
+    [ -n "$before" ] && [ "$(lab_in a1 ip -o link show group 2048 | cut -d: -f1,2)" = "$(cut -d: -f1,2 <<<"$before")" ] || die "not taken over"
+    lab_in a1 pkill -TERM -x tunneld
     says a1 10 'WCCP daemon exiting with code 0'
     router_is r1 5 51 '.counters.rx_shutdown == 1 and $g.appliances == []'
     lab_wait_event 10 a1 '^process wccpd: exited with 0, starts again' || die "not seen to end"

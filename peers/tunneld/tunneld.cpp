@@ -287,7 +287,8 @@ void look_at_mailbox(int, short, void *data) {
         }
         if (take_command(&daemon->desk, &end)) {
             daemon->last_command_ms = now;
-            mgmt_link_ask_routers(daemon->management); // a new tunnel may mean a new router
+            if (daemon->management)
+                mgmt_link_ask_routers(daemon->management); // a new tunnel may mean a new router
         }
         pause = mailbox_pause_ms(daemon->desk.attached, now - daemon->last_command_ms);
     }
@@ -376,6 +377,8 @@ bool start_parts(tunneld *daemon) {
         return false;
     if (daemon->plane != &table_plane)
         start_plane(daemon);
+    if (daemon->options.commands.silent) // like a program that hangs
+        return true;
     daemon->management = mgmt_link_new(
         daemon->loop, {[daemon](const configured_view &view) { take_configuration(daemon, view); },
                        [daemon] { return tunneld_state(*daemon); }});
