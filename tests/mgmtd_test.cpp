@@ -945,6 +945,40 @@ TEST(Supervision, AnEndHasItsNameAndTheNextStartItsDelay) {
         EXPECT_STREQ(end_event(one.status, one.ending), one.event);
 }
 
+// Of a mgmtd that was killed: the program is ending, and cannot be started beside itself.
+TEST(Supervision, AnEarlierRunEndsFirst) {
+    std::string said;
+    int64_t now = 1000;
+    supervisor self, earlier;
+    for (supervisor *each : {&earlier, &self}) {
+        each->children.push_back({"slow", {"sleep", "100"}});
+        each->children[0].lock_file = "/tmp/slow.lock";
+        each->now_ms = [&] { return now; };
+        each->say = [&](const std::string &line) { said += line + "\n"; };
+        each->tell = [](const std::string &, const std::string &) {};
+    }
+    (void)supervisor_tick(&earlier);
+    said.clear();
+    EXPECT_EQ(supervisor_tick(&self), now + EARLIER_RUN_EVERY_MS);
+    now += EARLIER_RUN_EVERY_MS;
+    (void)supervisor_tick(&self);
+    EXPECT_EQ(said, "process slow: an earlier one still runs; waits for its end\n");
+    kill(earlier.children[0].pid, SIGKILL); // its end counts before anybody has taken it in
+    pollfd ended = {earlier.children[0].pidfd, POLLIN, 0};
+    ASSERT_EQ(poll(&ended, 1, 5000), 1);
+    now += EARLIER_RUN_EVERY_MS;
+    (void)supervisor_tick(&self);
+    EXPECT_FALSE(supervisor_is_done(self));
+    for (supervisor *each : {&earlier, &self}) {
+        each->ending = true;
+        kill(each->children[0].pid, SIGKILL);
+        poll(&(ended = {each->children[0].pidfd, POLLIN, 0}), 1, 5000);
+        supervisor_reap(each);
+        EXPECT_TRUE(supervisor_is_done(*each));
+    }
+    unlink("/tmp/slow.lock");
+}
+
 // Its number may be another process's by then.
 TEST(Supervision, AChildWhoseEndSomebodyElseTookInIsOver) {
     std::vector<std::string> told;

@@ -60,6 +60,9 @@ says 1 1 "^process wccpd: does not end, killed"
 says 1 1 "^process tunneld: exited with 0"
 [ ! -e /tmp/gcl-socks/uds-provider-mgmtd ] || die "the socket is left"
 
+# The next mgmtd starts while the programs of the killed one are still ending.
+start
+kill -KILL $mgmtd
 start
 programs=("$(pid_of wccpd)" "$(pid_of tunneld)")
 kill -KILL $mgmtd

@@ -112,6 +112,8 @@ int main(int argc, char **argv) {
         processes.children.back().takes_over = true;
         daemon.opened = [&](const std::string &name) { supervisor_session_opened(&processes, name); };
         processes.children.push_back({"wccpd", {wccpd}});
+        for (child &process : processes.children)
+            process.lock_file = "/var/run/mgmtd." + process.name + ".lock";
     }
     for (;;) {
         const int64_t child_due = supervisor_tick(&processes);

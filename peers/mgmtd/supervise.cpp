@@ -18,6 +18,8 @@
 #include <cstring>
 #include <utility>
 
+#include <fcntl.h>
+#include <sys/file.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -46,7 +48,7 @@ static std::string end_text(int wait_status) {
                                     : "exited with " + std::to_string(WEXITSTATUS(wait_status));
 }
 
-[[noreturn]] static void become(const std::vector<std::string> &command, pid_t parent) {
+[[noreturn]] static void become(const std::vector<std::string> &command, pid_t parent, int lock) {
     prctl(PR_SET_PDEATHSIG, SIGTERM);
     if (getppid() != parent)
         _exit(127);
@@ -55,6 +57,8 @@ static std::string end_text(int wait_status) {
     sigprocmask(SIG_SETMASK, &none, nullptr);
     for (int number = 1; number < NSIG; number++) // what was ignored would stay so
         signal(number, SIG_DFL);
+    if (lock >= 0)
+        fcntl(lock, F_SETFD, 0);
     std::vector<char *> arguments;
     arguments.reserve(command.size() + 1);
     for (const std::string &word : command)
@@ -71,7 +75,7 @@ static const char *fork_child(child *process) {
     signal(SIGCHLD, SIG_DFL); // ignored, a child would be gone with its status before anybody looks
     const pid_t pid = fork();
     if (pid == 0)
-        become(process->command, parent);
+        become(process->command, parent, process->lock);
     if (pid < 0)
         return "fork";
     process->pid = pid;
@@ -85,8 +89,32 @@ static const char *fork_child(child *process) {
     return "pidfd_open";
 }
 
+// False while a run of an earlier mgmtd goes on. The program inherits the lock and holds it to its end; a
+// directory in which no lock can be made is no reason to start nothing.
+static bool lock_run(child *process) {
+    if (process->lock_file.empty())
+        return true;
+    process->lock = open(process->lock_file.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+    if (process->lock < 0 || flock(process->lock, LOCK_EX | LOCK_NB) == 0)
+        return true;
+    close(process->lock);
+    process->lock = -1;
+    return false;
+}
+
 static void start(supervisor *self, child *process) {
+    if (!lock_run(process)) {
+        if (!process->waits)
+            self->say("process " + process->name + ": an earlier one still runs; waits for its end");
+        process->waits = true;
+        process->start_at_ms = self->now_ms() + EARLIER_RUN_EVERY_MS;
+        return;
+    }
+    process->waits = false;
     const char *failed = fork_child(process);
+    if (process->lock >= 0)
+        close(process->lock);
+    process->lock = -1;
     process->started_ms = self->now_ms();
     if (failed) {
         const std::string reason = strerror(errno);

@@ -18,7 +18,8 @@ constexpr int64_t END_PATIENCE_MS = 10000;
 // For a child whose next run goes on with what the one before has left: from its end until the new process
 // has a session. Only then is the loss reported.
 constexpr int64_t TAKE_OVER_MS = 3000;
-constexpr int64_t SHORT_RUN_MS = 500; // a run that has ended sooner is not started again at once
+constexpr int64_t EARLIER_RUN_EVERY_MS = 200; // to the next look at a run that has to end first
+constexpr int64_t SHORT_RUN_MS = 500;         // a run that has ended sooner is not started again at once
 
 struct process_loss { // of a run whose next one may take over
     const char *event;
@@ -35,6 +36,11 @@ struct child {
     bool takes_over = false;
     bool has_session = false; // this run has opened one
     std::optional<process_loss> loss = {};
+    // A file that each run holds locked, or "". The run of a mgmtd that was killed may not have ended yet,
+    // and two at a time get into each other's way.
+    std::string lock_file = {};
+    int lock = -1;
+    bool waits = false; // for the end of such a run
 };
 struct supervisor {
     std::vector<child> children; // in the order of their start

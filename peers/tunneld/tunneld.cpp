@@ -13,12 +13,18 @@
 #include "peers/tunneld/tunneld.h"
 
 #include <arpa/inet.h>
+#include <fcntl.h>
 #include <ifaddrs.h>
 #include <net/if.h>
 #include <netinet/in.h>
 #include <signal.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
+#include <cstring>
 #include <ctime>
 
 #include <nlohmann/json.hpp>
@@ -36,6 +42,7 @@ namespace {
 constexpr uint32_t COMPONENT_TUNNELD = 257u << 16;
 constexpr int64_t RETRY_FIRST_MS = 1000, RETRY_MAX_MS = 30000;
 constexpr uint32_t ROLE_ACTIVE = 0;
+constexpr int64_t EARLIER_END_MS = 10000; // that an earlier tunneld may take to end
 
 std::vector<uint32_t> find_own_addresses() {
     std::vector<uint32_t> out;
@@ -385,6 +392,29 @@ bool start_parts(tunneld *daemon) {
     return daemon->management != nullptr;
 }
 
+// Of two tunnelds the one that ends would remove what the other has taken over. One that is killed lets go at
+// once; one that ends in order, as after the loss of its mgmtd, takes a moment. A system that has no room for
+// the lock is not a reason to carry nothing.
+bool take_lock(int *out_fd) {
+    (void)mkdir("/run/tunneld", 0755);
+    *out_fd = open("/run/tunneld/lock", O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+    if (*out_fd < 0) {
+        LC_LOG(LC_LOG_WARNING, "/run/tunneld/lock: %s", strerror(errno));
+        return true;
+    }
+    const int64_t until = lt_monotonic_ms() + EARLIER_END_MS;
+    while (flock(*out_fd, LOCK_EX | LOCK_NB) != 0) {
+        if (lt_monotonic_ms() >= until) {
+            fprintf(stderr, "tunneld: another tunneld runs here\n");
+            LC_LOG(LC_LOG_ERR, "Another tunneld runs here");
+            return false;
+        }
+        const timespec pause = {0, 20'000'000};
+        nanosleep(&pause, nullptr);
+    }
+    return true;
+}
+
 void end_parts(tunneld *daemon) {
     if (daemon->management)
         mgmt_link_free(daemon->management);
@@ -406,6 +436,7 @@ void end_parts(tunneld *daemon) {
 } // namespace
 
 int run_tunneld(const tunneld_options &options) {
+    int lock = -1;
     lc_init();
     lc_log_init("tunneld", nullptr, 0, COMPONENT_TUNNELD, LC_LOG_INFO,
                 lc_log_get_facility(nullptr, "tunneld"), 1);
@@ -414,12 +445,14 @@ int run_tunneld(const tunneld_options &options) {
     daemon.options = options;
     daemon.desk.options = options.commands;
     daemon.started_ms = daemon.last_command_ms = lt_monotonic_ms();
-    bool good = start_parts(&daemon);
+    bool good = take_lock(&lock) && start_parts(&daemon);
     if (good) {
         look_at_mailbox(-1, 0, &daemon);
         good = lew_dispatch(daemon.loop, nullptr, nullptr) == LC_OK;
     }
     end_parts(&daemon);
+    if (lock >= 0)
+        close(lock);
     lc_log_close();
     return good ? 0 : 1;
 }
