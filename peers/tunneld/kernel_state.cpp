@@ -170,6 +170,14 @@ struct kernel_view {
     std::vector<found_rule> rules;
 };
 
+void remove_unwanted_links(const data_plane &plane, const wanted_state &wanted, const kernel_view &there,
+                           failure *failed) {
+    drop_unwanted_made(plane, wanted, failed);
+    for (const auto &link : there.links)
+        if (!find_wanted(wanted, link.name) && !made.count(link.name))
+            failed->note("cannot remove link " + link.name, remove_link(link.index));
+}
+
 void remove_unwanted(const data_plane &plane, const wanted_state &wanted, const kernel_view &there,
                      failure *failed) {
     remove_rules(wanted, there.rules, failed);
@@ -177,10 +185,7 @@ void remove_unwanted(const data_plane &plane, const wanted_state &wanted, const 
     std::string error;
     if (!restore_settings(wanted.settings, &error))
         failed->note(error);
-    drop_unwanted_made(plane, wanted, failed);
-    for (const auto &link : there.links)
-        if (!find_wanted(wanted, link.name) && !made.count(link.name))
-            failed->note("cannot remove link " + link.name, remove_link(link.index));
+    remove_unwanted_links(plane, wanted, there, failed);
 }
 
 bool reconcile_table(const wanted_state &wanted, std::map<std::string, uint32_t> *out_indices,
@@ -259,6 +264,36 @@ bool reconcile_kernel_state(const data_plane &plane, const wanted_state &wanted,
         failed.note(error);
     remove_unwanted(plane, wanted, there, &failed);
     return failed.give(out_error);
+}
+
+bool reconcile_kernel_links(const data_plane &plane, const wanted_state &wanted,
+                            std::map<std::string, uint32_t> *out_indices, std::string *out_error) {
+    failure failed;
+    out_indices->clear();
+    kernel_view there;
+    if (!reconcile_links(plane, wanted, &there, out_indices, &failed) || !find_tables(&there, &failed))
+        return failed.give(out_error);
+    wanted_state missing = wanted;
+    std::erase_if(missing.routes, [&](const wanted_route &route) {
+        return std::any_of(there.routes.begin(), there.routes.end(), [&](const found_route &one) {
+            return !one.odd && one.route.table == route.table;
+        });
+    });
+    add_routes(missing, there.routes, &failed);
+    add_rules(wanted, there.rules, &failed);
+    // The number of a link that goes may be another's soon, and its table with it.
+    for (const auto &one : there.routes)
+        if (one.route.table != TABLE_LOCAL &&
+            std::none_of(wanted.routes.begin(), wanted.routes.end(),
+                         [&](const wanted_route &route) { return route.table == one.route.table; }))
+            failed.note("cannot remove " + route_text(one.route), remove_route(one));
+    remove_unwanted_links(plane, wanted, there, &failed);
+    return failed.give(out_error);
+}
+
+bool is_kernel_state_left() {
+    std::vector<found_rule> rules;
+    return find_rules(&rules) == 0 && !rules.empty();
 }
 
 bool remove_kernel_state(const data_plane &plane, std::string *out_error) {

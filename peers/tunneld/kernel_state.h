@@ -16,5 +16,11 @@ std::vector<wanted_link> find_own_links();
 // are there.
 bool reconcile_kernel_state(const data_plane &plane, const wanted_state &wanted,
                             std::map<std::string, uint32_t> *out_indices, std::string *out_error);
+// Before the configuration is known: links, with the routes and rules of their own, come and go with their
+// tunnels. What sorts packets stays as an earlier tunneld has left it, and so do its settings and routes.
+bool reconcile_kernel_links(const data_plane &plane, const wanted_state &wanted,
+                            std::map<std::string, uint32_t> *out_indices, std::string *out_error);
+// Whether an earlier tunneld has left anything that routes packets.
+bool is_kernel_state_left();
 // Everything of ours goes, and settings are as they were before. Also what an earlier tunneld has left.
 bool remove_kernel_state(const data_plane &plane, std::string *out_error);
