@@ -1,8 +1,11 @@
-// tunneld as wccpd sees it: a test plays wccpd's side of the mailbox by hand. The program is seen by the
-// scenarios.
+// tunneld as wccpd sees it: a test plays wccpd's side of the mailbox by hand. The program as a whole is run
+// without mgmtd here, and with it in the scenarios.
 
 #include <gtest/gtest.h>
+#include <net/if.h>
 #include <sched.h>
+#include <signal.h>
+#include <sys/prctl.h>
 #include <sys/shm.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -14,9 +17,13 @@
 #include <string>
 #include <thread>
 
-#include "peers/tunneld/commands.h"
+#include "peers/tunneld/kernel_state.h"
+#include "peers/tunneld/nft_commands.h"
+#include "peers/tunneld/tunneld.h"
+#include "peers/tunneld/user_tun.h"
 #include "platform/tunnel_mailbox.h"
 #include "runtime/cmem.h"
+#include "runtime/ttime.h"
 
 using namespace std::chrono_literals;
 
@@ -210,4 +217,129 @@ TEST_F(Tunneld, AppliesEachChangeOfTheTable) {
     give(MAILBOX_DELETE_TUNNEL, 310, 0x0A000002);
     EXPECT_TRUE(take_one(&desk));
     EXPECT_TRUE(made.empty());
+}
+
+// Tunnels that an older wccpd has ordered. A tunneld that was killed in the middle of an add finds no index
+// in the mailbox either.
+TEST_F(Tunneld, OnlyTunnelsOfAnOlderWccpdHaveToBeOrderedAgain) {
+    static const struct {
+        const char *pid; // that the last tunneld has noted, null for none
+        size_t later;    // tunnels that are left after the time to order them
+    } rows[] = {{"999999", 1}, {"", 2}, {nullptr, 2}};
+    const int64_t now = lt_monotonic_ms();
+    for (const auto &row : rows) {
+        desk = {};
+        start_commands(&desk, {}, out);
+        desk.tunnels = {{300, {0x0A000001, 0x0A000002, 7}}, {301, {0x0A000001, 0x0A000003, 8}}};
+        if (!row.pid)
+            forget_wccpd();
+        else if (*row.pid)
+            std::ofstream(WCCPD_FILE) << row.pid << "\n";
+        give(MAILBOX_ADD_TUNNEL, 300, 0x0A000002); // before anybody has looked for a new wccpd
+        EXPECT_TRUE(take_one(&desk));
+        watch_wccpd(&desk, now);
+        drop_unordered(&desk, now + UNORDERED_MS - 1000);
+        EXPECT_EQ(desk.tunnels.size(), 2u);
+        drop_unordered(&desk, now + UNORDERED_MS + 10000);
+        EXPECT_EQ(desk.tunnels.size(), row.later) << (row.pid ? row.pid : "none");
+        EXPECT_TRUE(desk.tunnels.contains(300));
+    }
+}
+
+namespace {
+
+pid_t start_process(const std::function<int()> &body) {
+    const pid_t child = fork();
+    if (child == 0) {
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        _exit(freopen("/dev/null", "w", stdout) ? body() : 1);
+    }
+    return child;
+}
+int end_process(pid_t child, int signal) {
+    int status = -1;
+    kill(child, signal);
+    waitpid(child, &status, 0);
+    return status;
+}
+pid_t start_tunneld(int unshared_fd = -1) {
+    return start_process(
+        [unshared_fd] { return close(unshared_fd), run_tunneld({.commands = {}, .plane = "user"}); });
+}
+
+// What an earlier tunneld has left: a tunnel, a further source beside it, and a group with an intercept.
+int leave_a_tunnel() {
+    std::string error;
+    appliance_view view;
+    view.tunnels = {{3, {0x0A000001, 0x0A000002}}};
+    view.groups[61] = {"lo", 0x0A000001, 0, false, {}};
+    view.intercepts[61].to = 3128;
+    view.conditions[61] = {true, true};
+    view.accepted = {{0x0A000009, 0}};
+    std::map<std::string, uint32_t> indices;
+    const bool done = user_plane.open(&error) &&
+                      reconcile_kernel_state(user_plane, make_wanted_state(view, {}, true), &indices, &error);
+    fprintf(stderr, "%s", error.c_str());
+    return done ? 0 : 1;
+}
+
+// The maps that packets are sorted by. Nothing stays open that a child could share.
+std::string sorting_maps() {
+    nlohmann::json maps;
+    std::string error;
+    EXPECT_TRUE(list_nft("list maps ip", &maps, &error)) << error;
+    close_nft();
+    return maps.dump();
+}
+
+uint32_t order(uint16_t code, uint16_t id, uint32_t remote) {
+    give(code, id, remote);
+    for (int i = 0; i < 500 && mailbox->command != 0; i++)
+        std::this_thread::sleep_for(10ms);
+    EXPECT_EQ(mailbox->command, 0) << "not answered";
+    return mailbox->fmst_index;
+}
+
+} // namespace
+
+TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
+    ASSERT_EQ(system("ip address add 10.0.0.1/24 dev lo"), 0);
+    ASSERT_EQ(end_process(start_process(leave_a_tunnel), 0), 0);
+    const std::string maps = sorting_maps();
+    const unsigned tunnel = if_nametoindex("wccp0"), beside = if_nametoindex("wccp1");
+    ASSERT_TRUE(tunnel && beside && maps.find("goto") != std::string::npos) << maps;
+
+    pid_t daemon = start_tunneld();
+    const uint32_t added = order(MAILBOX_ADD_TUNNEL, 4, 0x0A000004);
+    EXPECT_EQ(added, if_nametoindex("wccp2"));
+    EXPECT_EQ(system("ip rule | grep -q 'iif wccp2 lookup 204803' && ip route show table 204803 | "
+                     "grep -q 'default dev wccp2'"),
+              0);
+    order(MAILBOX_DELETE_TUNNEL, 4, 0x0A000004);
+    EXPECT_FALSE(if_nametoindex("wccp2"));
+    EXPECT_EQ(if_nametoindex("wccp0"), tunnel);
+    EXPECT_EQ(if_nametoindex("wccp1"), beside);
+    EXPECT_EQ(sorting_maps(), maps);
+    // An interface that somebody has removed comes back with the next order, under its new index.
+    EXPECT_EQ(system("ip link delete wccp0"), 0);
+    const uint32_t again = order(MAILBOX_ADD_TUNNEL, 3, 0x0A000002);
+    EXPECT_NE(again, tunnel);
+    EXPECT_EQ(again, if_nametoindex("wccp0"));
+    EXPECT_EQ(system("ip route show table 204801 | grep -q 'default dev wccp0'"), 0);
+    end_process(daemon, SIGKILL);
+
+    // A link that cannot be taken over yet: wccpd believes in its tunnel, which is made when that is
+    // possible.
+    tun_device held;
+    std::string error;
+    ASSERT_TRUE(tun_open("wccp0", &held, &error)) << error;
+    daemon = start_tunneld(held.fd);
+    std::this_thread::sleep_for(500ms);
+    close(held.fd);
+    EXPECT_EQ(order(MAILBOX_ADD_TUNNEL, 3, 0x0A000002), again);
+    EXPECT_EQ(sorting_maps(), maps);
+    EXPECT_EQ(end_process(daemon, SIGTERM), 0);
+    EXPECT_FALSE(if_nametoindex("wccp0") || if_nametoindex("wccp1"));
+    EXPECT_EQ(sorting_maps().find("goto"), std::string::npos);
+    EXPECT_FALSE(std::filesystem::exists(WCCPD_FILE));
 }

@@ -7,6 +7,9 @@
 // an id whose delete was lost, replaces what was there.
 #include "peers/tunneld/commands.h"
 
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <cerrno>
 #include <ctime>
 
@@ -15,6 +18,8 @@
 #include "peers/tunneld/link_names.h"
 #include "platform/tunnel_mailbox.h"
 #include "runtime/cmem.h"
+#include "runtime/logging.h"
+#include "runtime/ttime.h"
 
 namespace {
 
@@ -103,20 +108,39 @@ uint32_t add(command_desk *desk, const mailbox_command &command) {
     for (auto it = desk->tunnels.begin(); it != desk->tunnels.end();) {
         const bool same_id = it->first == command.tunnel_id;
         const bool same_ends = it->second.local == command.local && it->second.remote == command.remote;
-        if (same_id && same_ends)
-            return it->second.index;
-        it = same_id || same_ends ? desk->tunnels.erase(it) : std::next(it);
+        const bool replaced = same_id != same_ends;
+        it = replaced ? desk->tunnels.erase(it) : std::next(it);
     }
-    desk->tunnels[command.tunnel_id] = {command.local, command.remote, WCCP_NO_INDEX};
-    apply_table(desk);
-    if (!desk->apply)
-        desk->tunnels[command.tunnel_id].index = take_index(desk);
-    const uint32_t index = desk->tunnels[command.tunnel_id].index;
+    const command_tunnel wanted = {command.local, command.remote, WCCP_NO_INDEX};
+    const auto [tunnel, is_new] = desk->tunnels.insert({command.tunnel_id, wanted});
+    apply_table(desk); // a tunnel that is known, too: its interface may have gone
+    if (!desk->apply && is_new)
+        tunnel->second.index = take_index(desk);
+    const uint32_t index = tunnel->second.index;
     if (index == WCCP_NO_INDEX) {
         desk->tunnels.erase(command.tunnel_id);
         apply_table(desk);
     }
     return index;
+}
+
+int32_t read_wccpd_pid() {
+    int32_t pid = 0;
+    if (FILE *file = fopen(WCCPD_FILE, "re")) {
+        if (fscanf(file, "%9d", &pid) != 1)
+            pid = 0;
+        fclose(file);
+    }
+    return pid;
+}
+
+void write_wccpd_pid(int32_t pid) {
+    mkdir("/run/tunneld", 0755); // if it isn't there yet
+    FILE *file = fopen(WCCPD_FILE, "we");
+    if (!file || fprintf(file, "%d\n", pid) < 0)
+        LC_LOG(LC_LOG_WARNING, "Cannot write %s: %m", WCCPD_FILE);
+    if (file)
+        fclose(file);
 }
 
 // Carries the command out; the status that it is answered with.
@@ -133,7 +157,7 @@ uint32_t carry_out(command_desk *desk, const mailbox_command &command, uint32_t 
     switch (command.code) {
     case MAILBOX_ADD_TUNNEL:
         *out_index = add(desk, command);
-        desk->ordered[command.tunnel_id] = true;
+        desk->ordered.insert(command.tunnel_id);
         if (*out_index == WCCP_NO_INDEX)
             *out_result = "done, without an index";
         return 0;
@@ -157,6 +181,40 @@ uint32_t carry_out(command_desk *desk, const mailbox_command &command, uint32_t 
 }
 
 } // namespace
+
+void watch_wccpd(command_desk *desk, int64_t now_ms) {
+    bool lives = false;
+    const int32_t pid = cmem_find_creator(WCCP_MAILBOX_NAME, &lives);
+    if (pid == 0 || !lives || pid == desk->wccpd_pid)
+        return;
+    const int32_t before = desk->wccpd_pid ? desk->wccpd_pid : read_wccpd_pid();
+    desk->wccpd_pid = pid;
+    if (pid == before)
+        return;
+    write_wccpd_pid(pid);
+    desk->ordered.clear();
+    if (before == 0 || desk->tunnels.empty()) // or nobody knows: tunnels that may be in use stay
+        return;
+    LC_LOG(LC_LOG_NOTICE, "wccpd has been started anew: %zu tunnels wait to be ordered again",
+           desk->tunnels.size());
+    desk->unordered_until_ms = now_ms + UNORDERED_MS;
+}
+
+void drop_unordered(command_desk *desk, int64_t now_ms) {
+    if (desk->unordered_until_ms < 0 || now_ms < desk->unordered_until_ms)
+        return;
+    desk->unordered_until_ms = -1;
+    const size_t dropped = std::erase_if(
+        desk->tunnels, [&](const auto &tunnel) { return !desk->ordered.contains(tunnel.first); });
+    if (dropped == 0)
+        return;
+    LC_LOG(LC_LOG_NOTICE, "%zu tunnels that wccpd has not ordered again are removed", dropped);
+    apply_table(desk);
+}
+
+void forget_wccpd() {
+    unlink(WCCPD_FILE);
+}
 
 void print_roles(command_desk *desk) {
     static const char *const words[] = {"ACTIVE", "BACKUP", "UNKNOWN"};
@@ -196,6 +254,7 @@ bool take_command(command_desk *desk, bool *out_end) {
         desk->passed_over = command;
         return false;
     }
+    watch_wccpd(desk, lt_monotonic_ms());
     const mailbox_command given = command;
     const auto before = desk->tunnels;
     const char *result;

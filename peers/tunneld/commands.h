@@ -1,5 +1,6 @@
 // tunneld as wccpd sees it: takes commands from the mailbox, keeps the table of tunnels, answers and prints
 // each command. What a tunnel is made of is the caller's: `apply` is called after each change of the table.
+// Also knows which wccpd has ordered the tunnels: those that a new one doesn't order go after a time.
 #pragma once
 
 #include <cstdint>
@@ -7,9 +8,15 @@
 #include <functional>
 #include <map>
 #include <optional>
+#include <set>
 #include <string>
 
 #include <nlohmann/json_fwd.hpp>
+
+// Tunnels that a new wccpd does not order go after this time.
+constexpr int64_t UNORDERED_MS = 60000;
+// The process id of the wccpd that the tunnels were ordered by, for the next tunneld.
+constexpr char WCCPD_FILE[] = "/run/tunneld/wccpd";
 
 struct command_options {
     uint32_t first_index = 1; // without `apply`: index of the first tunnel, WCCP_NO_INDEX gives none to any
@@ -38,17 +45,19 @@ struct mailbox_command {
 struct command_desk {
     command_options options;
     FILE *out = stdout;
-    // Makes what the table says, and fills in the indices of tunnels that have none yet. Null: indices are
-    // handed out from `first_index`.
+    // Makes what the table says, and fills in the indices: WCCP_NO_INDEX where there is no interface. Null:
+    // indices are handed out from `first_index`.
     std::function<void(std::map<uint16_t, command_tunnel> *tunnels)> apply;
     std::function<void(uint8_t group, bool forced)> set_l2_return;
 
     bool attached = false;
     uint32_t next_index = 0;
     std::map<uint16_t, command_tunnel> tunnels;
-    std::map<uint16_t, bool> ordered;           // tunnel ids that the present wccpd has ordered
+    std::set<uint16_t> ordered;                 // tunnel ids that the present wccpd has ordered
     std::optional<mailbox_command> passed_over; // the command that is left unanswered, printed once
     std::map<uint16_t, uint32_t> roles;         // of policy groups, where not UNKNOWN
+    int32_t wccpd_pid = 0;                      // that the tunnels were ordered by; 0 unknown
+    int64_t unordered_until_ms = -1;            // -1: no tunnel waits to be ordered anew
 };
 
 // False, with a line in the log, when shared memory cannot be used.
@@ -56,6 +65,13 @@ bool start_commands(command_desk *desk, const command_options &options, FILE *ou
 // Takes the pending command, if there is one. False when there was nothing to do. `out_end` is set when a
 // signal came while the command was under way.
 bool take_command(command_desk *desk, bool *out_end);
+// Looks whether wccpd has been started anew. To be called now and then; take_command() does it too, before it
+// takes a command of a wccpd that has only just been started.
+void watch_wccpd(command_desk *desk, int64_t now_ms);
+// Removes the tunnels whose time is over.
+void drop_unordered(command_desk *desk, int64_t now_ms);
+// At an orderly end, after which there are no tunnels.
+void forget_wccpd();
 // The time to the next look at the mailbox, by the time since the last command or the start.
 int64_t mailbox_pause_ms(bool attached, int64_t quiet_ms);
 void print_roles(command_desk *desk);

@@ -1,6 +1,5 @@
 // tunneld [--plane auto|kernel|user|table] [--return-redirect] [--json] [--roles] [--slow MS] [--refuse]
-// [--silent]
-//         [--index N]
+//         [--silent] [--index N]
 #include <CLI/CLI.hpp>
 
 #include "peers/tunneld/tunneld.h"

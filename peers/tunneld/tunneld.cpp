@@ -4,12 +4,9 @@
 // longer it has been quiet, and four times a second while there is none. wccpd waits for two seconds, of
 // which the longest pause takes a small part. Everything that is due now and then is done on the same timer.
 //
-// A tunneld that is killed leaves its interfaces, routes and rules, and the next one takes them over. It
-// changes nothing, takes no command and therefore sends nobody's packets elsewhere, until it has read the
-// configuration.
-//
-// Requests to mgmtd wait by running the loop again from inside, therefore every callback here may run during
-// one.
+// A tunneld that is killed leaves its interfaces, routes and rules, and the next one takes them over. Until
+// it has read the configuration, however long that takes, it makes and removes tunnels as it is ordered to,
+// but sorts packets as the one before did: flows that are being served go on.
 #include "peers/tunneld/tunneld.h"
 
 #include <arpa/inet.h>
@@ -31,7 +28,6 @@
 
 #include "peers/tunneld/kernel_state.h"
 #include "platform/tunnel_mailbox.h"
-#include "runtime/cmem.h"
 #include "runtime/common.h"
 #include "runtime/logging.h"
 #include "runtime/loop_host.h"
@@ -103,14 +99,28 @@ appliance_view view_appliance(const tunneld &daemon) {
 void report_failure(tunneld *daemon, const std::string &error) {
     if (!error.empty()) {
         daemon->retry_delay_ms = std::clamp(daemon->retry_delay_ms * 2, RETRY_FIRST_MS, RETRY_MAX_MS);
-        daemon->retry_at_ms = lt_monotonic_ms() + daemon->retry_delay_ms;
+        daemon->again_at_ms = lt_monotonic_ms() + daemon->retry_delay_ms;
         if (error != daemon->failure)
             LC_LOG(LC_LOG_ERR, "The kernel is not as wanted: %s", error.c_str());
-    } else if (!daemon->failure.empty()) {
-        LC_LOG(LC_LOG_NOTICE, "The kernel is as wanted again");
+    } else {
+        if (!daemon->failure.empty())
+            LC_LOG(LC_LOG_NOTICE, "The kernel is as wanted again");
         daemon->retry_delay_ms = 0;
+        daemon->again_at_ms = lt_monotonic_ms() + VERIFY_MS;
     }
     daemon->failure = error;
+}
+
+// Interfaces come, go and change: what a tunnel's index is, only the last look at the kernel says.
+void note_indices(tunneld *daemon) {
+    for (auto &[id, tunnel] : daemon->desk.tunnels) {
+        tunnel.index = WCCP_NO_INDEX;
+        for (const wanted_link &link : daemon->links)
+            if (const auto index = daemon->indices.find(link.name);
+                !link.wish.accepted && link.wish.local == tunnel.local && link.wish.remote == tunnel.remote &&
+                index != daemon->indices.end())
+                tunnel.index = index->second;
+    }
 }
 
 void reconcile(tunneld *daemon) {
@@ -118,25 +128,35 @@ void reconcile(tunneld *daemon) {
         return;
     wanted_state wanted =
         make_wanted_state(view_appliance(*daemon), daemon->links, daemon->plane == &user_plane);
-    const bool again = !daemon->failure.empty() && lt_monotonic_ms() >= daemon->retry_at_ms;
-    if (daemon->applied == wanted && !again)
+    if (daemon->applied == wanted && lt_monotonic_ms() < daemon->again_at_ms)
         return;
     std::string error;
-    (void)reconcile_kernel_state(*daemon->plane, wanted, &daemon->indices, &error);
+    (void)(daemon->takes_over ? reconcile_kernel_links : reconcile_kernel_state)(*daemon->plane, wanted,
+                                                                                 &daemon->indices, &error);
     report_failure(daemon, error);
     daemon->links = wanted.links;
     daemon->applied = std::move(wanted);
+    note_indices(daemon);
 }
 
-// What the table of commands asks for.
-void apply_tunnels(tunneld *daemon, std::map<uint16_t, command_tunnel> *tunnels) {
+// Ends the taking over once it is known how packets are to be sorted. Without a router the groups that
+// redirect by L2 are not known; a wccpd that isn't there, or has none, is not waited for long.
+void end_take_over(tunneld *daemon) {
+    if (!daemon->takes_over || daemon->configured_ms < 0)
+        return;
+    const auto &groups = daemon->configured.groups;
+    const bool has_router = std::any_of(groups.begin(), groups.end(),
+                                        [](const auto &group) { return !group.second.routers.empty(); });
+    if (!has_router && !groups.empty() && lt_monotonic_ms() < daemon->configured_ms + TAKE_OVER_WAIT_MS)
+        return;
+    daemon->takes_over = false;
+    daemon->applied.reset();
+}
+
+// What the table of commands asks for. A look at the kernel is due even where the table is as it was.
+void apply_tunnels(tunneld *daemon) {
+    daemon->applied.reset();
     reconcile(daemon);
-    for (auto &[id, tunnel] : *tunnels)
-        for (const wanted_link &link : daemon->links)
-            if (const auto index = daemon->indices.find(link.name);
-                !link.wish.accepted && link.wish.local == tunnel.local && link.wish.remote == tunnel.remote &&
-                index != daemon->indices.end())
-                tunnel.index = index->second;
 }
 
 // --- Health
@@ -210,7 +230,9 @@ void read_roles(tunneld *daemon) {
 
 void take_configuration(tunneld *daemon, const configured_view &view) {
     daemon->configured = view;
-    daemon->configured_once = true;
+    if (daemon->configured_ms < 0)
+        daemon->configured_ms = lt_monotonic_ms();
+    end_take_over(daemon);
     daemon->own_addresses = find_own_addresses();
     for (auto it = daemon->outages.begin(); it != daemon->outages.end();) {
         if (view.intercepts.contains(it->first)) {
@@ -228,46 +250,12 @@ void take_configuration(tunneld *daemon, const configured_view &view) {
     daemon->last_command_ms = lt_monotonic_ms(); // commands may follow
 }
 
-// --- wccpd's comings and goings
-
-void watch_wccpd(tunneld *daemon, int64_t now) {
-    bool lives = false;
-    const int32_t pid = cmem_find_creator(WCCP_MAILBOX_NAME, &lives);
-    if (pid == 0 || !lives || pid == daemon->wccpd_pid)
-        return;
-    // The mailbox of a wccpd that has ordered nothing yet holds no index.
-    const bool fresh = daemon->wccpd_pid != 0 || wccp_get_fmst_index() == WCCP_NO_INDEX;
-    daemon->wccpd_pid = pid;
-    if (daemon->desk.tunnels.empty())
-        return;
-    if (!fresh) {
-        for (const auto &[id, tunnel] : daemon->desk.tunnels)
-            daemon->desk.ordered[id] = true;
-        return;
-    }
-    LC_LOG(LC_LOG_NOTICE, "wccpd has been started anew: %zu tunnels wait to be ordered again",
-           daemon->desk.tunnels.size());
-    daemon->desk.ordered.clear();
-    daemon->unordered_until_ms = now + UNORDERED_MS;
-}
-
-void drop_unordered(tunneld *daemon, int64_t now) {
-    if (daemon->unordered_until_ms < 0 || now < daemon->unordered_until_ms)
-        return;
-    daemon->unordered_until_ms = -1;
-    const size_t dropped = std::erase_if(daemon->desk.tunnels, [&](const auto &tunnel) {
-        return !daemon->desk.ordered.contains(tunnel.first);
-    });
-    if (dropped)
-        LC_LOG(LC_LOG_NOTICE, "%zu tunnels that wccpd has not ordered again are removed", dropped);
-    reconcile(daemon);
-}
-
 // --- The loop
 
 void tick(tunneld *daemon, int64_t now) {
-    watch_wccpd(daemon, now);
-    drop_unordered(daemon, now);
+    watch_wccpd(&daemon->desk, now);
+    drop_unordered(&daemon->desk, now);
+    end_take_over(daemon);
     if (daemon->desk.options.roles && daemon->desk.attached)
         print_roles(&daemon->desk);
     read_roles(daemon);
@@ -276,30 +264,22 @@ void tick(tunneld *daemon, int64_t now) {
     reconcile(daemon);
 }
 
-bool takes_over_still(const tunneld &daemon, int64_t now) {
-    return !daemon.configured_once && !daemon.desk.tunnels.empty() &&
-           now - daemon.started_ms < TAKE_OVER_WAIT_MS;
-}
-
 void look_at_mailbox(int, short, void *data) {
     auto *daemon = static_cast<tunneld *>(data);
     const int64_t now = lt_monotonic_ms();
     bool end = false;
-    int64_t pause = 5;
-    if (!takes_over_still(*daemon, now)) {
-        // In the order in which a command could change what the other reads.
-        if (now >= daemon->tick_at_ms) {
-            daemon->tick_at_ms = now + TICK_MS;
-            tick(daemon, now);
-        }
-        if (take_command(&daemon->desk, &end)) {
-            daemon->last_command_ms = now;
-            if (daemon->management)
-                mgmt_link_ask_routers(daemon->management); // a new tunnel may mean a new router
-        }
-        pause = mailbox_pause_ms(daemon->desk.attached, now - daemon->last_command_ms);
+    // In the order in which a command could change what the other reads.
+    if (now >= daemon->tick_at_ms) {
+        daemon->tick_at_ms = now + TICK_MS;
+        tick(daemon, now);
     }
-    LOG_STATUS(loop_event_set_timer(daemon->mailbox_timer, pause));
+    if (take_command(&daemon->desk, &end)) {
+        daemon->last_command_ms = now;
+        if (daemon->management)
+            mgmt_link_ask_routers(daemon->management); // a new tunnel may mean a new router
+    }
+    LOG_STATUS(loop_event_set_timer(daemon->mailbox_timer,
+                                    mailbox_pause_ms(daemon->desk.attached, now - daemon->last_command_ms)));
 }
 
 lc_status take_signal(int number, short, void *, lew *loop) {
@@ -335,31 +315,29 @@ bool choose_plane(tunneld *daemon) {
     return true;
 }
 
-// Takes over what a killed tunneld has left.
+// Takes over what a killed tunneld has left. Of two tunnels with one id the one that was made last is kept:
+// the other was being replaced.
 void take_over(tunneld *daemon) {
     daemon->links = find_own_links();
-    for (const wanted_link &link : daemon->links) {
-        uint32_t index = 0;
-        std::string error;
-        if (!daemon->plane->make_link(link.name, link.wish, &index, &error)) {
-            LC_LOG(LC_LOG_WARNING, "%s is not taken over: %s", link.name.c_str(), error.c_str());
-            continue;
-        }
-        daemon->indices[link.name] = index;
+    daemon->takes_over = !daemon->links.empty() || is_kernel_state_left();
+    if (!daemon->takes_over)
+        return;
+    for (const wanted_link &link : daemon->links)
         if (!link.wish.accepted)
-            daemon->desk.tunnels[link.wish.tunnel_id] = {link.wish.local, link.wish.remote, index};
-    }
-    if (!daemon->links.empty())
-        LC_LOG(LC_LOG_NOTICE, "%zu tunnels are taken over", daemon->desk.tunnels.size());
+            daemon->desk.tunnels[link.wish.tunnel_id] = {link.wish.local, link.wish.remote, WCCP_NO_INDEX};
+    for (const wanted_link &link : daemon->links)
+        if (const auto beside = daemon->desk.tunnels.find(link.wish.tunnel_id);
+            link.wish.accepted && beside != daemon->desk.tunnels.end())
+            daemon->configured.accepted.push_back({link.wish.remote, beside->second.remote});
+    LC_LOG(LC_LOG_NOTICE, "%zu tunnels are taken over", daemon->desk.tunnels.size());
+    reconcile(daemon);
 }
 
 void start_plane(tunneld *daemon) {
     daemon->lack = probe_sorting_rules();
     if (!daemon->lack.empty())
         LC_LOG(LC_LOG_ERR, "Packets cannot be sorted, therefore all are returned: %s", daemon->lack.c_str());
-    daemon->desk.apply = [daemon](std::map<uint16_t, command_tunnel> *tunnels) {
-        apply_tunnels(daemon, tunnels);
-    };
+    daemon->desk.apply = [daemon](std::map<uint16_t, command_tunnel> *) { apply_tunnels(daemon); };
     daemon->desk.set_l2_return = [daemon](uint8_t group, bool forced) {
         daemon->forced_l2[group] = forced;
         reconcile(daemon);
@@ -423,8 +401,10 @@ void end_parts(tunneld *daemon) {
     std::string error;
     if (daemon->plane && daemon->plane != &table_plane && !remove_kernel_state(*daemon->plane, &error))
         LC_LOG(LC_LOG_ERR, "Not everything could be removed from the kernel: %s", error.c_str());
-    if (daemon->plane)
+    if (daemon->plane) {
+        forget_wccpd();
         daemon->plane->close();
+    }
     if (daemon->mailbox_timer)
         loop_event_free(&daemon->mailbox_timer);
     if (daemon->loop) {
@@ -444,7 +424,7 @@ int run_tunneld(const tunneld_options &options) {
     tunneld daemon;
     daemon.options = options;
     daemon.desk.options = options.commands;
-    daemon.started_ms = daemon.last_command_ms = lt_monotonic_ms();
+    daemon.last_command_ms = lt_monotonic_ms();
     bool good = take_lock(&lock) && start_parts(&daemon);
     if (good) {
         look_at_mailbox(-1, 0, &daemon);

@@ -6,7 +6,6 @@
 #include <cstdint>
 #include <map>
 #include <optional>
-#include <set>
 #include <string>
 #include <vector>
 
@@ -18,10 +17,11 @@
 #include "peers/tunneld/wanted_state.h"
 
 constexpr int64_t TICK_MS = 1000;
-// What a killed tunneld has left stays as it is until the configuration has been read, so long at most.
-constexpr int64_t TAKE_OVER_WAIT_MS = 1500;
-// Tunnels that a new wccpd does not order go after this time.
-constexpr int64_t UNORDERED_MS = 60000;
+// How packets are sorted stays as a killed tunneld has left it until the configuration has been read and
+// wccpd has named a router; for the latter, so long at most.
+constexpr int64_t TAKE_OVER_WAIT_MS = 10000;
+// Between looks whether somebody else has changed what is ours in the kernel.
+constexpr int64_t VERIFY_MS = 30000;
 
 struct tunneld_options {
     command_options commands;
@@ -47,22 +47,19 @@ struct tunneld {
     health_monitor *health = nullptr;
 
     configured_view configured;
-    bool configured_once = false;
-    int64_t started_ms = 0;
+    int64_t configured_ms = -1; // when it was read first
+    bool takes_over = false;    // and sorts as the tunneld before did
     int64_t tick_at_ms = 0, last_command_ms = 0;
     std::map<uint8_t, bool> forced_l2; // by command, which wins over the configuration
     std::map<uint16_t, bool> roles;    // of the policy groups of groups with an intercept: ACTIVE
     std::map<uint8_t, outage> outages;
     std::vector<uint32_t> own_addresses;
 
-    int32_t wccpd_pid = 0;           // that the tunnels were ordered by
-    int64_t unordered_until_ms = -1; // -1: no tunnel waits to be ordered anew
-
     std::vector<wanted_link> links; // that are there, or were wanted last
     std::optional<wanted_state> applied;
     std::map<std::string, uint32_t> indices; // of the links
     std::string failure;                     // of the last reconciling, or ""
-    int64_t retry_at_ms = -1, retry_delay_ms = 0;
+    int64_t again_at_ms = 0, retry_delay_ms = 0;
 };
 
 // The program, until a signal ends it. The exit code.
