@@ -237,6 +237,9 @@ case_kills() {
     done
     jq -se 'length > 0 and all(.[]; .failures | keys - ["reset", "closed"] == [])' "$results" >/dev/null || die "transfers: $(cat "$results")"
     [ "$(lab_in a1 pgrep -x wccpd)" = "$wccpd" ] || die "wccpd has gone"
+    # What somebody else removes comes back by itself.
+    lab_in a1 ip link delete wccp0 || die "no link to delete"
+    fetches_within 12 "$(by a1)"
     # All of them at once, with their rules: the next ones take them over.
     lab_in a1 pkill -KILL -x 'mgmtd|tunneld|wccpd'
     lab_wait_exit 5 a1 mgmtd
