@@ -184,7 +184,7 @@ bool take_frame(coalescer *merger, exact_memory *frame) {
         return false;
     REQUIRE(outer.local == 0x0a000002 && outer.remote == 0x0a000001);
     gre_content content;
-    if (read_gre_payload(outer.payload, outer.length, &content) != REFUSALS)
+    if (read_gre_payload(outer.payload, outer.length, false, &content) != REFUSALS)
         return false;
     REQUIRE(ip4_is_valid(content.packet, content.length));
     keep_packet(&taken, bytes(content.packet, content.packet + content.length));

@@ -3,13 +3,16 @@
 
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
+#include <net/ethernet.h>
 #include <net/if.h>
 #include <netinet/tcp.h>
+#include <netpacket/packet.h>
 #include <poll.h>
 #include <sched.h>
 #include <signal.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
+#include <sys/uio.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -109,11 +112,13 @@ TEST(gre, headers_are_taken_or_refused) {
     cut.pop_back();
     padded.resize(packet.size() + 6);
     corrupt.back()++;
+    bytes stale = wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
+    stale[4]++;
     const struct {
         const char *what;
         bytes payload;
         refusal why;
-        bool has_redirect = false;
+        bool has_redirect = false, merged = false;
     } rows[] = {
         {"plain", wrap(0, GRE_TYPE_IPV4, packet), REFUSALS},
         {"padded", wrap(0, GRE_TYPE_IPV4, padded), REFUSALS},
@@ -122,6 +127,7 @@ TEST(gre, headers_are_taken_or_refused) {
         {"checksum", wrap(GRE_CHECKSUM, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
         {"reserved bits", wrap(0x03f8, GRE_TYPE_IPV4, packet), REFUSALS},
         {"wrong checksum", corrupt, REFUSED_CHECKSUM},
+        {"checksum of the first of several", stale, REFUSALS, false, true},
         {"checksum cut", {0x80, 0, 8, 0, 0, 0}, REFUSED_LENGTH},
         {"routing", wrap(0x4000, GRE_TYPE_IPV4, packet), REFUSED_FLAGS},
         {"key", wrap(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}), REFUSED_FLAGS},
@@ -139,7 +145,7 @@ TEST(gre, headers_are_taken_or_refused) {
         SCOPED_TRACE(row.what);
         payload = row.payload;
         gre_content content;
-        ASSERT_EQ(read_gre_payload(payload.data(), payload.size(), &content), row.why);
+        ASSERT_EQ(read_gre_payload(payload.data(), payload.size(), row.merged, &content), row.why);
         if (row.why != REFUSALS)
             continue;
         EXPECT_EQ(bytes(content.packet, content.packet + content.length), packet);
@@ -308,7 +314,7 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
 // --- live: this process is the appliance, a child in a network namespace of its own the router
 
 constexpr uint32_t APPLIANCE = 0x0a000001, ROUTER = 0x0a000002, STRANGER = 0x0a000003;
-constexpr size_t TRANSFER = 24 << 20, LARGE_DATAGRAM = 30000;
+constexpr size_t TRANSFER = 24 << 20, LARGE_DATAGRAM = 30000, PARTIAL_DATAGRAM = 501;
 
 void shell(const std::string &command) {
     ASSERT_EQ(system(command.c_str()), 0) << command;
@@ -359,6 +365,31 @@ int send_by_hand() {
                : 2;
 }
 
+// A datagram as a kernel on the same machine sends it, whose checksum the device would complete.
+int send_partial() {
+    bytes inner = make_packet(PROTOCOL_UDP, 3, PARTIAL_DATAGRAM);
+    ip(&inner)->destination = to_be32(0xc0a80901);
+    mend(&inner);
+    at<udp_wire_header>(&inner, 20)->checksum =
+        checksum_fold(checksum_pseudo(*ip(&inner), inner.size() - 20));
+    bytes packet(sizeof(ip4_wire_header)), gre = wrap(0, GRE_TYPE_IPV4, inner);
+    *ip(&packet) = {0x45, 0, {}, {}, {}, 64, PROTOCOL_GRE, {}, to_be32(ROUTER), to_be32(APPLIANCE)};
+    packet.insert(packet.end(), gre.begin(), gre.end());
+    mend(&packet);
+    ether_header ether = {{2, 0, 0, 0, 0, 1}, {2, 0, 0, 0, 0, 2}, htons(ETHERTYPE_IP)};
+    virtio_header header = {VIRTIO_NEEDS_CHECKSUM, 0, 0, 0, sizeof ether + 20 + 4 + 20, 6};
+    iovec parts[] = {{&header, sizeof header}, {&ether, sizeof ether}, {packet.data(), packet.size()}};
+    sockaddr_ll device = {};
+    device.sll_family = AF_PACKET;
+    device.sll_ifindex = static_cast<int>(if_nametoindex("vr"));
+    const int fd = socket(AF_PACKET, SOCK_RAW, 0), on = 1;
+    const bool sent = setsockopt(fd, SOL_PACKET, PACKET_VNET_HDR, &on, sizeof on) == 0 &&
+                      bind(fd, reinterpret_cast<const sockaddr *>(&device), sizeof device) == 0 &&
+                      writev(fd, parts, 3) > 0;
+    close(fd);
+    return sent ? 0 : 1;
+}
+
 // Gives back what comes, until the other side has no more.
 int echo_once() {
     const int listener = socket(AF_INET, SOCK_STREAM, 0), on = 1;
@@ -386,6 +417,8 @@ int child_main(int commands, int answers) {
         uint32_t index;
         if (command == 'h')
             result = send_by_hand();
+        else if (command == 'c')
+            result = send_partial();
         else if (command == 'p')
             result = !user_plane.open(&error) ||
                      !user_plane.make_link("wccp0", {1, ROUTER, APPLIANCE, false}, &index, &error) ||
@@ -415,7 +448,7 @@ struct live_plane : testing::Test {
         close(commands[0]);
         ASSERT_TRUE(answered());
         const std::string pid = std::to_string(child), inside = "nsenter -t " + pid + " -n ip ";
-        shell("ip link add va type veth peer name vr netns " + pid);
+        shell("ip link add va address 02:00:00:00:00:01 type veth peer name vr netns " + pid);
         shell("ip addr add 10.0.0.1/24 dev va && ip link set va up");
         shell(inside + "addr add 10.0.0.2/24 dev vr && " + inside + "addr add 10.0.0.3/24 dev vr && " +
               inside + "link set vr up");
@@ -497,11 +530,17 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     EXPECT_EQ(counters.links["wccp0"].bytes_in, 1500u + LARGE_DATAGRAM + 28);
     bytes datagram(LARGE_DATAGRAM + 1);
     EXPECT_EQ(recv(datagrams, datagram.data(), datagram.size(), 0), static_cast<ssize_t>(LARGE_DATAGRAM));
-    close(datagrams);
     EXPECT_EQ(counters.links["wccp0"].packets_out, 1u);
     EXPECT_EQ(counters.links["wccp0"].refused[REFUSED_FLAGS], 1u);
     EXPECT_EQ(counters.refused[REFUSED_SOURCE], 1u);
     EXPECT_EQ(counters.refused_sources, (std::map<uint32_t, uint64_t>{{STRANGER, 1}}));
+
+    order('c');
+    EXPECT_TRUE(answered());
+    pollfd comes = {datagrams, POLLIN, 0};
+    EXPECT_EQ(poll(&comes, 1, 3000), 1);
+    EXPECT_EQ(recv(datagrams, datagram.data(), datagram.size(), 0), static_cast<ssize_t>(PARTIAL_DATAGRAM));
+    close(datagrams);
 
     order('p');
     ASSERT_TRUE(answered());

@@ -34,7 +34,7 @@ refusal read_gre_outer(uint8_t *bytes, size_t length, gre_outer *out) {
     return REFUSALS;
 }
 
-refusal read_gre_payload(uint8_t *bytes, size_t length, gre_content *out) {
+refusal read_gre_payload(uint8_t *bytes, size_t length, bool merged, gre_content *out) {
     *out = {};
     if (length < sizeof(gre_wire_header))
         return REFUSED_LENGTH;
@@ -46,7 +46,7 @@ refusal read_gre_payload(uint8_t *bytes, size_t length, gre_content *out) {
     if (flags & GRE_CHECKSUM) {
         if (length < at + sizeof(gre_wire_checksum))
             return REFUSED_LENGTH;
-        if (!checksum_is_right(checksum_add(0, bytes, length)))
+        if (!merged && !checksum_is_right(checksum_add(0, bytes, length)))
             return REFUSED_CHECKSUM;
         at += sizeof(gre_wire_checksum);
     }

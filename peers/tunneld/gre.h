@@ -45,6 +45,8 @@ struct gre_content {
 
 // Both give REFUSALS when there is nothing to refuse, otherwise why. What they give points into the bytes.
 refusal read_gre_outer(uint8_t *bytes, size_t length, gre_outer *out);
-refusal read_gre_payload(uint8_t *bytes, size_t length, gre_content *out);
+// `merged`: the kernel has put it together from several packets, whose checksums it has verified. The one
+// that is left in the header is that of the first.
+refusal read_gre_payload(uint8_t *bytes, size_t length, bool merged, gre_content *out);
 // Writes the header, of type 0x883E where there is a redirect header. At most GRE_MAX_WRITTEN bytes.
 size_t write_gre_header(uint8_t *out, const gre_wire_redirect *redirect);

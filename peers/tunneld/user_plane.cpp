@@ -207,12 +207,13 @@ refusal carry_large(user_state *plane, user_link *link, const ring_packet &from,
 
 refusal carry_payload(user_state *plane, user_link *link, const ring_packet &from, const gre_outer &outer) {
     gre_content content;
-    const refusal why = read_gre_payload(outer.payload, outer.length, &content);
+    const bool merged = from.header.gso_type != VIRTIO_NOT_LARGE;
+    const refusal why = read_gre_payload(outer.payload, outer.length, merged, &content);
     if (why != REFUSALS)
         return why;
     if (user_plane_settings.redirect_header)
         remember_redirect(plane, *link, content);
-    if (from.header.gso_type != VIRTIO_NOT_LARGE)
+    if (merged)
         return carry_large(plane, link, from, content);
     link->counters.packets_in++;
     link->counters.bytes_in += content.length;
