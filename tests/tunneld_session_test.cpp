@@ -68,6 +68,12 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
     EXPECT_EQ(view.groups[51], (group_view{"eth0", 0, 0, true, {}}));
     EXPECT_EQ(view.groups[52].interface, "");
 
+    // The file of a command may have blanks in its name, as mgmtd takes it; the path of a page may not.
+    nodes[10].value.text = "/opt/a check";
+    EXPECT_FALSE(read_configuration(nodes, &complaints).intercepts.contains(51));
+    nodes[9].value.text = "command";
+    EXPECT_EQ(read_configuration(nodes, &complaints).intercepts[51].check.argument, "/opt/a check");
+
     // What a default would turn into "everything" costs the whole intercept.
     for (const char *ports : {"", "80 0", "8080-8000", "65536", "80;443", "-80"}) {
         nodes[6].value.text = ports;

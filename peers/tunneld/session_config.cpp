@@ -101,7 +101,7 @@ bool take_prefixes(const std::string &text, std::vector<ip_prefix> *out) {
 
 bool take_argument(const std::string &text, std::string *out) {
     if (text.size() > 255 || std::any_of(text.begin(), text.end(), [](char c) {
-            return static_cast<unsigned char>(c) <= 0x20 || c == 0x7f;
+            return static_cast<unsigned char>(c) < 0x20 || c == 0x7f;
         }))
         return false;
     *out = text;
@@ -171,7 +171,10 @@ void leave_out_unsound(reading *self) {
             if (const auto found = taken.find(node.name);
                 node.needed && (found == taken.end() || !found->second))
                 missing = missing.empty() ? node.name : missing;
-        if (missing.empty() && rules.check.kind != check_kind::tcp && rules.check.argument.empty())
+        const std::string &argument = rules.check.argument; // a blank would end the path of a page
+        if (missing.empty() && rules.check.kind != check_kind::tcp &&
+            (argument.empty() ||
+             (rules.check.kind == check_kind::http && argument.find(' ') != std::string::npos)))
             missing = "check_argument";
         if (missing.empty()) {
             ++at;
