@@ -123,6 +123,7 @@ TEST(Schema, ListsAreCheckedAndBroughtIntoOneForm) {
         {"bypass", "10.0.0.0/33", "", "is no list of IPv4 prefixes"},
         {"bypass", "10.0.0.1/31", "", "host bits"},
         {"check_argument", "usr/bin/true", "", "does not begin with"},
+        {"check_argument", "/opt/a check", "/opt/a check", ""},
         {"to", "0", "", "is not between 1 and 65535"},
     };
     for (const auto &one : cases) {
@@ -771,6 +772,36 @@ TEST_F(Mgmtd, AStateThatNobodyGives) {
     }
     query(3, STATE + "/51/oper", bn_query_get);
     EXPECT_EQ(message(), "wccpd has no session");
+
+    // Of two daemons the one that goes half-way leaves nothing, whichever was asked for first.
+    const auto follow = [&](uint32_t peer_id) {
+        action(peer_id, "/mgmtd/events/actions/interest/add",
+               {{"event_name", {bn_type_name, EVENT_CONFIG_CHANGE}}});
+        clear();
+    };
+    server_peer_opened(&daemon, 1, "wccpd-8");
+    server_peer_opened(&daemon, 5, "tunneld-9");
+    follow(1);
+    follow(5);
+    bn_request_msg *both = nullptr;
+    ASSERT_EQ(bn_query_request_msg_create(&both, 0, nullptr), LC_OK);
+    for (const char *name : {NODE_PLANE_STATE, "/qv/wccpd/wccp/srv_grp"})
+        ASSERT_EQ(bn_query_request_msg_append_str(both, bn_query_iterate, bn_qf_subtree, name, nullptr),
+                  LC_OK);
+    EXPECT_TRUE(give(3, both));
+    const auto answer_last = [&](uint32_t peer_id, const std::vector<event_field> &fields) {
+        ASSERT_EQ(sent.size(), 1u);
+        ASSERT_EQ(sent[0].peer, peer_id);
+        const uint32_t id = sent[0].request->msg_id, node_id = last_node(sent[0].request)->node_id;
+        clear();
+        answer(peer_id, id, node_id, 0, fields);
+    };
+    answer_last(1, {{STATE + "/7", {bn_type_str, "7"}}, {STATE + "/51", {bn_type_str, "51"}}});
+    answer_last(1, {{STATE + "/7/oper", {bn_type_str, "INIT"}}});
+    clear();
+    server_peer_closed(&daemon, 1);
+    answer_last(5, {{NODE_PLANE_STATE "/name", {bn_type_str, "user"}}});
+    EXPECT_EQ(found(), strings{NODE_PLANE_STATE "/name=user"});
 }
 
 // --- Events

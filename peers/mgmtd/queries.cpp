@@ -289,6 +289,7 @@ void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
     for (const asked_node &node : query.asked)
         if (node_name name; parse_node_name(node.name, &name))
             plan_node(&query.parts, node, name);
+    std::ranges::sort(query.parts, {}, &daemon_part::source);
     ask_next(self, std::move(query));
 }
 
