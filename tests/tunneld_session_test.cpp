@@ -255,6 +255,14 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     mgmt_link_ask_routers(link);
     EXPECT_FALSE(wait_until([&] { return readings > before; }, 600));
 
+    // A refused configuration is asked for again.
+    int refusals = 0;
+    daemon->fits = [&](uint32_t, size_t) { return refusals++ > 0; };
+    set(NODE_GROUP_CONFIG "/51/policy_grp", "7");
+    EXPECT_TRUE(wait_until([&] { return view.groups[51].policy_group == 7; }));
+    EXPECT_GT(refusals, 0);
+    before = readings;
+
     // mgmtd goes: all stays, and the next one is found without help.
     stop_mgmtd();
     ASSERT_TRUE(wait_until([&] { return !mgmt_link_is_open(link); }));

@@ -141,6 +141,13 @@ void ask_routers_now(mgmt_link *link) {
 
 // --- What comes. These run inside the library, with its locks held.
 
+void log_complaints(mgmt_link *link, std::vector<std::string> complaints) {
+    if (complaints != link->complaints)
+        for (const std::string &line : complaints)
+            LC_LOG(LC_LOG_WARNING, "%s", line.c_str());
+    link->complaints = std::move(complaints);
+}
+
 // The answer to `waiting`, if that is what it is. A refused one is an answer without nodes.
 bool take_answer(request *waiting, const bn_response_msg *msg, std::vector<event_field> *out,
                  bool *out_came) {
@@ -155,10 +162,17 @@ bool take_answer(request *waiting, const bn_response_msg *msg, std::vector<event
 
 lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) {
     auto *link = static_cast<mgmt_link *>(data);
-    if (take_answer(&link->configuration, msg, &link->configured, &link->has_configured) ||
-        take_answer(&link->groups, msg, &link->listed, &link->has_listed) ||
-        take_answer(&link->routers, msg, &link->states, &link->has_states))
+    if (take_answer(&link->configuration, msg, &link->configured, &link->has_configured)) {
+        if (!link->has_configured) { // as after a time in which this program has read nothing
+            log_complaints(link, {std::string("the configuration is not given: ") +
+                                  (msg->return_message ? ts_str(msg->return_message) : "")});
+            link->read_at_ms = std::min(link->read_at_ms, lt_monotonic_ms() + RETRY_MS);
+        }
         advance_soon(link);
+    } else if (take_answer(&link->groups, msg, &link->listed, &link->has_listed) ||
+               take_answer(&link->routers, msg, &link->states, &link->has_states)) {
+        advance_soon(link);
+    }
     return LC_OK;
 }
 
@@ -322,10 +336,7 @@ void take_configuration(mgmt_link *link, configured_view *next) {
     std::vector<std::string> complaints;
     *next = read_configuration(link->configured, &complaints);
     link->expected = count_configured_routers(link->configured);
-    if (complaints != link->complaints)
-        for (const std::string &line : complaints)
-            LC_LOG(LC_LOG_WARNING, "%s", line.c_str());
-    link->complaints = std::move(complaints);
+    log_complaints(link, std::move(complaints));
     link->configured.clear();
 }
 
