@@ -32,7 +32,7 @@ extern "C" {
 
 namespace {
 constexpr int64_t CHECK_MAX_MS = 10000;
-constexpr int KILL_MAX_MS = 1000;
+constexpr int64_t KILL_MAX_MS = 1000;
 constexpr int64_t STAGGER_MS = 2;         // between the first checks of many new ones
 constexpr size_t ANSWER_MAX_BYTES = 4096; // of which the first line counts
 constexpr size_t LINGERING_MAX = 64;      // killed commands that have not ended
@@ -249,11 +249,11 @@ int spawn_command(const std::string &file, pid_t *out_pid) {
     return error;
 }
 
-// One that doesn't end even so is left to whoever takes in orphans.
-void kill_at_once(pid_t pid, int pidfd) {
-    kill(-pid, SIGKILL);
+// Takes in the end of a command that has been killed. One that doesn't end even so is left to whoever takes
+// in orphans.
+void wait_for_killed(pid_t pid, int pidfd, int64_t deadline_ms) {
     pollfd end = {pidfd, POLLIN, 0};
-    (void)poll(&end, 1, KILL_MAX_MS);
+    (void)poll(&end, 1, static_cast<int>(std::max<int64_t>(deadline_ms - lt_monotonic_ms(), 0)));
     (void)waitpid(pid, nullptr, WNOHANG);
     close(pidfd);
 }
@@ -272,7 +272,8 @@ std::string begin_command(watched *self) {
     if (command.pidfd < 0 || loop_event_new(monitor->loop, take_end, &command, &command.end) != LC_OK ||
         loop_event_set_fd(command.end, command.pidfd, LOOP_READ) != LC_OK) {
         loop_event_free(&command.end);
-        kill_at_once(pid, command.pidfd);
+        kill(-pid, SIGKILL);
+        wait_for_killed(pid, command.pidfd, lt_monotonic_ms() + KILL_MAX_MS);
         monitor->commands.pop_back();
         return "no room for a check";
     }
@@ -365,9 +366,11 @@ void health_free(health_monitor *monitor) {
         return;
     for (const auto &[group, check] : monitor->checks)
         end_watching(check.get());
+    // All have been killed by now, and wait together.
+    const int64_t deadline_ms = lt_monotonic_ms() + KILL_MAX_MS;
     for (running_command &command : monitor->commands) {
         loop_event_free(&command.end);
-        kill_at_once(command.pid, command.pidfd);
+        wait_for_killed(command.pid, command.pidfd, deadline_ms);
     }
     delete monitor;
 }
