@@ -1,7 +1,7 @@
 #!/bin/bash
 # mgmtd starts the appliance's programs and keeps them: both sessions open, a tunneld that crashes is replaced
-# unnoticed, one that is ended takes wccpd with it and both come back, a file edited by hand reaches wccpd, a program that doesn't end is made to, and nothing outlives a
-# mgmtd that is killed.
+# unnoticed, one that is ended takes wccpd with it and both come back, a file edited by hand reaches wccpd, a
+# program that doesn't end is killed, and nothing outlives a mgmtd that is killed.
 #   scenario_supervise.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
