@@ -1,7 +1,7 @@
 #!/bin/bash
-# mgmtd starts the appliance's programs and keeps them: both sessions open, a tunneld that crashes is replaced
-# unnoticed, one that is ended takes wccpd with it and both come back, a file edited by hand reaches wccpd, a
-# program that doesn't end is killed, and nothing outlives a mgmtd that is killed.
+# mgmtd starts the appliance's programs with their options and keeps them: both sessions open, a tunneld that crashes
+# is replaced unnoticed, one that is ended takes wccpd with it and both come back, a file edited by hand reaches wccpd,
+# a program that doesn't end is made to, and nothing outlives an mgmtd that is killed.
 #   scenario_supervise.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
@@ -28,14 +28,16 @@ says() { # SECONDS COUNT PATTERN
 }
 start() { # however it was started: a caller may have ignored the signal that tells of a child's end
     : >$out
-    env --ignore-signal=CHLD "$bin/mgmtd" --config $config --supervise --wccpd "$bin/wccpd" --tunneld "$bin/tunneld" >$out 2>&1 &
+    env --ignore-signal=CHLD "$bin/mgmtd" --config $config --supervise --wccpd "$bin/wccpd" --tunneld " $bin/tunneld  --plane table" >$out 2>&1 &
     mgmtd=$!
     says 20 2 "^session of wccpd-[0-9]+ open"
     says 20 1 "^role of group 51: BACKUP"
 }
 pid_of() { sed -n "s/^process $1: started, pid //p" $out | tail -n 1; }
 
+! "$bin/mgmtd" --config $config --supervise --tunneld ' ' >$out 2>&1 || die "started without a program"
 start
+[ "$(tr '\0' ' ' <"/proc/$(pid_of tunneld)/cmdline")" = "$bin/tunneld --plane table " ] || die "the options of tunneld"
 first=$(pid_of wccpd)
 says 10 1 "^session of tunneld-[0-9]+ open"
 sleep 0.6 # a run that is shorter counts as one that failed to start

@@ -1,4 +1,4 @@
-// mgmtd [--config FILE] [--check] [--supervise [--wccpd PATH] [--tunneld PATH]]
+// mgmtd [--config FILE] [--check] [--supervise [--wccpd COMMAND] [--tunneld COMMAND]]
 #include <algorithm>
 #include <climits>
 #include <csignal>
@@ -73,8 +73,14 @@ int main(int argc, char **argv) {
         ->capture_default_str();
     app.add_flag("--check", check, "read the configuration file, report what is wrong with it, and end");
     app.add_flag("--supervise", supervise, "start tunneld and wccpd, and start them again when they end");
-    app.add_option("--wccpd", wccpd, "the program, with --supervise")->capture_default_str();
-    app.add_option("--tunneld", tunneld, "the program, with --supervise")->capture_default_str();
+    const auto has_word = [](const std::string &line) {
+        return command_words(line).empty() ? std::string("no program is given") : std::string();
+    };
+    for (std::string *command : {&wccpd, &tunneld})
+        app.add_option(command == &wccpd ? "--wccpd" : "--tunneld", *command,
+                       "with --supervise: the program and its options, separated by blanks")
+            ->check(CLI::Validator(has_word, "COMMAND"))
+            ->capture_default_str();
     CLI11_PARSE(app, argc, argv);
 
     lc_init();
@@ -108,10 +114,10 @@ int main(int argc, char **argv) {
         server_process_event(&daemon, event, process);
     };
     if (supervise) {
-        processes.children.push_back({"tunneld", {tunneld}});
+        processes.children.push_back({"tunneld", command_words(tunneld)});
         processes.children.back().takes_over = true;
         daemon.opened = [&](const std::string &name) { supervisor_session_opened(&processes, name); };
-        processes.children.push_back({"wccpd", {wccpd}});
+        processes.children.push_back({"wccpd", command_words(wccpd)});
         for (child &process : processes.children)
             process.lock_file = "/var/run/mgmtd." + process.name + ".lock";
     }

@@ -16,6 +16,8 @@
 #include <csignal>
 #include <cstdio>
 #include <cstring>
+#include <iterator>
+#include <sstream>
 #include <utility>
 
 #include <fcntl.h>
@@ -30,6 +32,11 @@ extern "C" {
 
 #include "mgmt/node_paths.h"
 #include "runtime/common.h"
+
+std::vector<std::string> command_words(const std::string &line) {
+    std::istringstream words(line);
+    return {std::istream_iterator<std::string>(words), {}};
+}
 
 int64_t next_delay(int64_t before_ms, int64_t ran_ms) {
     if (before_ms == 0 || ran_ms >= SETTLED_MS)

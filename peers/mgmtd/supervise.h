@@ -50,6 +50,9 @@ struct supervisor {
     bool ending = false;
 };
 
+// The program and its options from a command line, which is split at blanks; nothing is quoted. Empty for one
+// that has no word.
+std::vector<std::string> command_words(const std::string &line);
 // Appends what becomes readable when a process ends.
 void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout);
 // Takes in who has ended.
