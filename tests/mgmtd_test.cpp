@@ -850,12 +850,22 @@ TEST_F(Mgmtd, AGroupThatIsOutOfItsRoutersIsDownForWccpdAlone) {
         query(peer_id, admin, bn_query_get);
         return found().empty() ? "" : found().front().substr(admin.size() + 1);
     };
+    std::string heard; // by a session that watches: l and j
+    const auto listen = [&] {
+        for (const sent_message &one : sent)
+            if (one.peer == 8 && one.mtype == bn_msg_event)
+                heard += strcmp(ts_str(one.request->text), EVENT_GROUP_LEAVE) == 0 ? "l" : "j";
+        return changes();
+    };
     const auto report = [&](uint32_t peer_id, const char *event, std::vector<event_field> more = {}) {
         more.push_back({"group", {bn_type_uint8, "51"}});
         clear();
         EXPECT_TRUE(give(peer_id, make_event(event, more)));
-        return changes();
+        return listen();
     };
+    server_peer_opened(&daemon, 8, "mgmtctl-1");
+    for (const char *event : {EVENT_GROUP_LEAVE, EVENT_GROUP_JOIN})
+        action(8, "/mgmtd/events/actions/interest/add", {{"event_name", {bn_type_name, event}}});
     const event_field reason = {"reason", {bn_type_str, "proxy down: status 503"}};
     const strings goes = {admin + "=up>down"}, comes = {admin + "=down>up"};
     ASSERT_EQ(set({{bn_set_create, GROUP + "/interface", "eth0"},
@@ -894,7 +904,7 @@ TEST_F(Mgmtd, AGroupThatIsOutOfItsRoutersIsDownForWccpdAlone) {
         clear();
         now += after_ms;
         (void)server_tick(&daemon);
-        return changes();
+        return listen();
     };
     EXPECT_EQ(report(5, EVENT_GROUP_LEAVE, {reason}), goes);
     server_peer_closed(&daemon, 5);
@@ -910,6 +920,8 @@ TEST_F(Mgmtd, AGroupThatIsOutOfItsRoutersIsDownForWccpdAlone) {
     EXPECT_EQ(tick(LEFT_KEEP_MS), comes);
     query(3, left, bn_query_get);
     EXPECT_EQ(found(), strings{});
+
+    EXPECT_EQ(heard, "ljljlj") << "each change once, whoever reports it";
 
     // With the group it goes, and doesn't come back with it.
     server_peer_opened(&daemon, 7, "tunneld-11");

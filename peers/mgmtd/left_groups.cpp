@@ -96,6 +96,7 @@ static void end_leave(server *self, uint8_t group, const std::string &why) {
         return;
     server_remove_report(self, report_of(group));
     self->say("group " + std::to_string(group) + " joins its routers again: " + why);
+    server_send_event(self, EVENT_GROUP_JOIN, {{"group", {bn_type_uint8, std::to_string(group)}}});
     send_admin(self, group, "down", "up");
 }
 
@@ -111,6 +112,7 @@ void server_take_leave(server *self, uint32_t peer_id, const std::vector<event_f
         return;
     self->state[report.below("since")] = server_time_now();
     self->say("group " + std::to_string(group) + " leaves its routers: " + self->state[report].text);
+    server_send_event(self, EVENT_GROUP_LEAVE, fields);
     send_admin(self, group, "up", "down");
 }
 

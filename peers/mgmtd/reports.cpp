@@ -90,10 +90,14 @@ static void take_role(server *self, uint32_t peer_id, const std::vector<event_fi
 static const struct {
     const char *event;
     void (*take)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+    bool repeated = false; // also sent without a change: `take` passes on what is one
 } reports[] = {
-    {EVENT_RAISE_ALARM, take_raise},      {EVENT_CLEAR_ALARM, take_clear},
-    {EVENT_ROLE_CHANGE, take_role},       {EVENT_GROUP_LEAVE, server_take_leave},
-    {EVENT_GROUP_JOIN, server_take_join}, {EVENT_PROXY_CHANGE, server_take_proxy_change},
+    {EVENT_RAISE_ALARM, take_raise},
+    {EVENT_CLEAR_ALARM, take_clear},
+    {EVENT_ROLE_CHANGE, take_role},
+    {EVENT_GROUP_LEAVE, server_take_leave, true},
+    {EVENT_GROUP_JOIN, server_take_join, true},
+    {EVENT_PROXY_CHANGE, server_take_proxy_change},
 };
 
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,
@@ -101,7 +105,8 @@ void server_take_event(server *self, uint32_t peer_id, const std::string &event,
     for (const auto &report : reports)
         if (event == report.event) {
             report.take(self, peer_id, fields);
-            server_send_event(self, event, fields);
+            if (!report.repeated)
+                server_send_event(self, event, fields);
             return;
         }
     self->say("event of " + self->peers[peer_id].name + " passed over: " + event);
