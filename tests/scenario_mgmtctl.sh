@@ -145,6 +145,7 @@ ctl bypass add 10.0.0.0/8 >/dev/null && ctl intercept add 51 all to 3128 >/dev/n
 [ "$(completed bypass delete 10.0.0.0/)" = 10.0.0.0/8 ] && [ "$(completed intercept set '')" = 51 ] &&
     [ "$(completed intercept set 51 ch)" = check ] && [ "$(completed intercept set 51 rest d)" = drop ] ||
     fail "the shell completes words of redirected traffic otherwise"
+expect 0 'jq:.intercepts[0] | .group == 51 and .active' --json intercept show 051
 ctl bypass delete 10.0.0.0/8 >/dev/null; ctl intercept delete 51 >/dev/null
 [ "$(completed al)" = alarms ] && [ "$(completed get "${G%1}")" = $G ] && [ "$(completed group set '')" = 51 ] &&
     [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&

@@ -58,14 +58,6 @@ std::vector<uint32_t> find_own_addresses() {
 
 // --- What follows from what is known
 
-bool is_active(const tunneld &daemon, uint8_t group) {
-    const auto found = daemon.configured.groups.find(group);
-    if (found == daemon.configured.groups.end() || found->second.policy_group == 0)
-        return true;
-    const auto role = daemon.roles.find(found->second.policy_group);
-    return role != daemon.roles.end() && role->second;
-}
-
 // Before its first check a proxy counts as up, as it was under the tunneld before; a gateway that fails
 // closed takes no chances.
 bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules) {
@@ -86,7 +78,7 @@ appliance_view view_appliance(const tunneld &daemon) {
             found->second.force_l2_return = forced;
     view.intercepts = daemon.configured.intercepts;
     for (const auto &[group, rules] : view.intercepts)
-        view.conditions[group] = {is_proxy_up(daemon, group, rules), is_active(daemon, group)};
+        view.conditions[group] = {is_proxy_up(daemon, group, rules), is_active_group(daemon, group)};
     const int64_t now = time(nullptr);
     for (const bypass_entry &entry : daemon.configured.bypasses)
         if (entry.until == 0 || entry.until > now)
@@ -414,6 +406,14 @@ void end_parts(tunneld *daemon) {
 }
 
 } // namespace
+
+bool is_active_group(const tunneld &daemon, uint8_t group) {
+    const auto found = daemon.configured.groups.find(group);
+    if (found == daemon.configured.groups.end() || found->second.policy_group == 0)
+        return true;
+    const auto role = daemon.roles.find(found->second.policy_group);
+    return role != daemon.roles.end() && role->second;
+}
 
 int run_tunneld(const tunneld_options &options) {
     int lock = -1;

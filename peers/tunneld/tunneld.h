@@ -62,6 +62,8 @@ struct tunneld {
     int64_t again_at_ms = 0, retry_delay_ms = 0;
 };
 
+// Whether no role keeps new flows of the group from its proxy.
+bool is_active_group(const tunneld &daemon, uint8_t group);
 // The program, until a signal ends it. The exit code.
 int run_tunneld(const tunneld_options &options);
 // The state nodes, in the order of a walk.

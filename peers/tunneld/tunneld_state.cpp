@@ -90,12 +90,7 @@ void add_intercepts(const tunneld &daemon, const sorting_counters &sorting, std:
         writer.add("proxy", bn_type_str, words[known ? state->second.state : proxy_health::unknown]);
         writer.add("proxy_reason", bn_type_str, known ? state->second.reason : "");
         writer.count("proxy_ms", known ? static_cast<uint64_t>(now - state->second.since_ms) : 0);
-        const auto condition =
-            daemon.applied &&
-            std::any_of(
-                daemon.applied->sorting.groups.begin(), daemon.applied->sorting.groups.end(),
-                [&](const sorted_group &each) { return each.group == group && each.condition.active; });
-        writer.add("active", bn_type_bool, condition ? "true" : "false");
+        writer.add("active", bn_type_bool, is_active_group(daemon, group) ? "true" : "false");
         const auto outage = daemon.outages.find(group);
         writer.add("left", bn_type_bool,
                    outage != daemon.outages.end() && outage->second.left ? "true" : "false");
