@@ -43,6 +43,31 @@ TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
     }
 }
 
+TEST(Shown, AnEventIsALineAndAnObject) {
+    const ctl_binding group = {"group", "uint8", "51"}, reason = {"reason", "string", "refused\033"};
+    const struct {
+        ctl_event event;
+        const char *text, *json;
+    } cases[] = {
+        {{EVENT_GROUP_LEAVE, {group, reason}},
+         "group 51 leaves its routers: refused?",
+         R"({"event":"group_leave","group":51,"reason":"refused?"})"},
+        {{EVENT_GROUP_JOIN, {group}},
+         "group 51 joins its routers again",
+         R"({"event":"group_join","group":51})"},
+        {{EVENT_PROXY_CHANGE, {group, {"up", "bool", "false"}, reason}},
+         "proxy of group 51: down, refused?",
+         R"({"event":"proxy","group":51,"proxy":"down","reason":"refused?"})"},
+        {{EVENT_PROXY_CHANGE, {group, {"up", "bool", "true"}, reason}},
+         "proxy of group 51: up",
+         R"({"event":"proxy","group":51,"proxy":"up","reason":null})"},
+    };
+    for (const auto &one : cases) {
+        EXPECT_EQ(text_event(one.event, false), std::vector<std::string>{one.text});
+        EXPECT_EQ(json_line(json_event(one.event, false)), std::string(one.json) + "\n");
+    }
+}
+
 TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
     const std::string entry = "/mgmtd/notification/dbchange/";
     const ctl_event change = {EVENT_CONFIG_CHANGE,

@@ -190,10 +190,14 @@ static bool add_interests(ctl_session *session, std::string *out_reason) {
         const char *event;
         std::vector<std::string> patterns;
     } wanted[] = {
-        {EVENT_CONFIG_CHANGE, {NODE_WCCPD "/**", NODE_SYSTEM_MODE}},
+        {EVENT_CONFIG_CHANGE,
+         {NODE_WCCPD "/**", NODE_SYSTEM_MODE, NODE_INTERCEPT_CONFIG "/**", NODE_ACCEPT_CONFIG "/**"}},
         {EVENT_RAISE_ALARM, {}},
         {EVENT_CLEAR_ALARM, {}},
         {EVENT_ROLE_CHANGE, {}},
+        {EVENT_PROXY_CHANGE, {}},
+        {EVENT_GROUP_LEAVE, {}},
+        {EVENT_GROUP_JOIN, {}},
         {EVENT_PROCESS_CRASH, {}},
         {EVENT_PROCESS_EXIT, {}},
         {EVENT_PROCESS_TERMINATE, {}},

@@ -17,6 +17,7 @@
 #include <unistd.h>
 
 #include "mgmt/node_paths.h"
+#include "peers/mgmtctl/show_model.h"
 #include "peers/nodes/binding_text.h"
 #include "peers/nodes/schema.h"
 
@@ -96,6 +97,43 @@ static std::string role_text(const event_row &row, const ctl_event &event) {
     return row.words + value_of(event, "group") + ": " + role_name(value_of(event, "role"));
 }
 
+static ctl_json group_json(const event_row &row, const ctl_event &event) {
+    return {{"event", row.name}, {"group", number(value_of(event, "group"))}};
+}
+static std::string group_text(const event_row &row, const ctl_event &event) {
+    return "group " + value_of(event, "group") + row.words;
+}
+
+static std::string reason_of(const ctl_event &event) {
+    return clean_text(value_of(event, "reason"), 255);
+}
+static std::string with_reason(const char *sign, const std::string &reason) {
+    return reason.empty() ? "" : sign + reason;
+}
+
+static ctl_json leave_json(const event_row &row, const ctl_event &event) {
+    ctl_json out = group_json(row, event);
+    out["reason"] = reason_of(event);
+    return out;
+}
+static std::string leave_text(const event_row &row, const ctl_event &event) {
+    return group_text(row, event) + with_reason(": ", reason_of(event));
+}
+
+// The reason is that of the last failed check, also when the proxy is up again.
+static ctl_json proxy_json(const event_row &row, const ctl_event &event) {
+    const bool up = value_of(event, "up") == "true";
+    ctl_json out = group_json(row, event);
+    out["proxy"] = up ? "up" : "down";
+    out["reason"] = up ? ctl_json(nullptr) : ctl_json(reason_of(event));
+    return out;
+}
+static std::string proxy_text(const event_row &row, const ctl_event &event) {
+    const std::string subject = row.words + value_of(event, "group");
+    return value_of(event, "up") == "true" ? subject + ": up"
+                                           : subject + ": down" + with_reason(", ", reason_of(event));
+}
+
 static std::string process_of(const ctl_event &event) {
     return event.bindings.empty() ? "" : event.bindings[0].value;
 }
@@ -117,6 +155,9 @@ static const event_row rows[] = {
     {EVENT_RAISE_ALARM, "alarm_raised", "alarm raised: ", alarm_json, alarm_text},
     {EVENT_CLEAR_ALARM, "alarm_cleared", "alarm cleared: ", alarm_json, alarm_text},
     {EVENT_ROLE_CHANGE, "role", "role of group ", role_json, role_text},
+    {EVENT_PROXY_CHANGE, "proxy", "proxy of group ", proxy_json, proxy_text},
+    {EVENT_GROUP_LEAVE, "group_leave", " leaves its routers", leave_json, leave_text},
+    {EVENT_GROUP_JOIN, "group_join", " joins its routers again", group_json, group_text},
     {EVENT_PROCESS_CRASH, "process_crash", " crashed", process_json, process_text},
     {EVENT_PROCESS_EXIT, "process_exit", " ended unexpectedly", process_json, process_text},
     {EVENT_PROCESS_TERMINATE, "process_terminate", " was terminated", process_json, process_text},
