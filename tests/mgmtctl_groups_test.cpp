@@ -21,15 +21,19 @@ struct fake {
                                                 {ROOT + "/weight", "100"}}; // its default
     std::vector<std::vector<ctl_change_item>> commits;                      // that were sent
     uint32_t code = 0;                                                      // of the answer, 1: none comes
+    int session_after = 0; // which query tunneld answers, 0: none
 
     group_result run(const std::vector<std::string> &words) { return group_command(link(), words); }
     ctl_link link() {
         commits.clear();
         ctl_link link;
         link.settle_ms = 0;
+        link.session_ms = session_after > 0 ? 3000 : 0;
         link.query = [this](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *) {
             if (name.find("/state") != std::string::npos)
                 out->code = LC_IO_CLOSED;
+            if (name == NODE_PLANE_STATE "/name" && session_after > 0 && --session_after == 0)
+                *out = {LC_OK, "", {{name, "string", "kernel"}}};
             for (const auto &[node, value] : nodes)
                 if (node == name || (walk == ctl_walk::subtree && node.starts_with(name + "/")))
                     out->bindings.push_back({node, "string", value});
@@ -142,12 +146,14 @@ TEST(Intercepts, WrongClausesChangeNothingAndAreTold) {
         {{"add", "51", "to", "80"}, CTL_USAGE, "\"all\" is missing"},
         {{"add", "51", "port", "to", "80"}, CTL_USAGE, "\"port\" needs a value"},
         {{"add", "51", "port", "80", "all", "to", "1"}, CTL_USAGE, "exclude each other"},
-        {{"add", "51", "all", "port", "80", "to", "1"}, CTL_USAGE, "given twice"},
         {{"add", "51", "port", "80", "tp", "3128"}, CTL_USAGE, "did you mean \"to\"?"},
         {{"set", "51", "to", "none"}, CTL_USAGE, "\"to\" needs a value"},
         {{"set", "51", "rise", "2", "rise", "3"}, CTL_USAGE, "given twice"},
         {{"set", "51", "check", "htp", "/"}, CTL_USAGE, "did you mean \"http\"?"},
         {{"set", "51", "check", "http", "rise", "2"}, CTL_USAGE, "needs the path of a page"},
+        {{"add", "51", "all", "port", "80", "to", "1"}, CTL_USAGE, "\"all\" exclude each other"},
+        {{"add", "51", "all", "all", "to", "1"}, CTL_USAGE, "\"all\" is given twice"},
+        {{"show", "x"}, CTL_USAGE, "intercept show [GROUP]"},
         {{"set", "51", "bypass"}, CTL_USAGE, "\"bypass\" needs a value"},
         {{"set", "51", "rise", "2"}, CTL_NOT_FOUND, "no intercept for group 51"},
     };
@@ -180,7 +186,10 @@ TEST(Intercepts, ClausesInAnyOrderAreOneCommit) {
                                                                         {"/check_argument", "/x"}})
         mgmtd.nodes[INTERCEPT + node] = value;
     const words unchanged = {"set", "51", "port", "443", "80", "rise", "2", "check", "http", "/x"};
-    EXPECT_EQ(intercept_command(mgmtd.link(), unchanged).done, "unchanged");
+    mgmtd.session_after = 2; // tunneld has just been started
+    result = intercept_command(mgmtd.link(), unchanged);
+    EXPECT_EQ(result.done, "unchanged");
+    EXPECT_EQ(result.tunneld, "running");
     EXPECT_TRUE(mgmtd.commits.empty());
     EXPECT_EQ(intercept_command(mgmtd.link(), {"set", "51", "check", "tcp", "all"}).done, "changed");
     EXPECT_EQ(mgmtd.sent(0, INTERCEPT), "create /check=tcp;reset /check_argument=;create /ports=all;");

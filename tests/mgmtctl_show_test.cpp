@@ -269,7 +269,8 @@ static void add_traffic(canned *from, const char *lines) {
 }
 
 static const char *const TRAFFIC =
-    "P/name kernel|P/reason ip_gre is there|P/clamped 0|P/refused/source 9|P/refused_source/10.0.0.9 9|"
+    "P/name user|P/reason kernel: no GRE|P/lack no tproxy|P/failure wccp0: busy\033|P/clamped "
+    "0|P/refused/source 9|P/refused_source/10.0.0.9 9|"
     "T/3 3|T/3/local 10.0.0.101|T/3/remote 10.0.0.1|T/3/interface wccp0|T/3/index 12|T/3/packets_in 1234567|"
     "T/3/bytes_in 999999999|T/3/fragments 4|T/3/refused/flags 2|T/3/in 7|T/3/own 3|P/own 3|"
     "I/51 51|I/51/proxy down|I/51/proxy_reason refused\033[2J|I/51/proxy_ms 640000|I/51/active "
@@ -289,9 +290,11 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
     const snapshot shown = from.gather();
     const std::string screen = joined(draw_screen(shown, {80, 0, false, false, ""}));
     for (const char *text : {"51  left its routers",
-                             "\ntraffic  data plane kernel  1 tunnel\n"
+                             "\ntraffic  data plane user  1 tunnel\n"
                              "  51  proxy down 0:10:40  in 120  to proxy 100  returned 12  proxy down 8\n"
                              "  52  proxy up  in 99999  to proxy 18E  returned 0\n"
+                             "  all packets are returned: no tproxy\n"
+                             "  the kernel is not as wanted: wccp0: busy?\n"
                              "  group 51 has left its routers: no good check for 30 s\n"
                              "  group 52: not ACTIVE in its policy group; new flows are returned\n"
                              "  the router redirects this appliance's own traffic\n"
@@ -303,7 +306,8 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
     EXPECT_EQ(traffic["tunnels"][0]["in"]["bytes"], 999999999);
     EXPECT_EQ(traffic["intercepts"][1]["sorted"]["to_proxy"]["packets"], UINT64_MAX);
     EXPECT_EQ(traffic["left"].dump(), R"([{"group":51,"reason":"no good check for 30 s"}])");
-    EXPECT_EQ(traffic["reasons"].size(), 5u);
+    EXPECT_EQ(traffic["reasons"].size(), 7u);
+    EXPECT_EQ(traffic["lack"], "no tproxy");
     // A proxy that is down is a reason of its own only while the group is in its routers, and fragments only
     // while nothing is clamped; a source that is accepted by now is none.
     std::erase_if(from.nodes,
@@ -331,14 +335,15 @@ TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
     };
     ctl_options options;
     EXPECT_EQ(printed([&] { return tell_tunnels(options, link); }, CTL_UNREACHABLE),
-              "tunneld is not running\n");
+              "tunneld has no session\n");
     add_traffic(&from, TRAFFIC);
     EXPECT_EQ(printed([&] { return tell_tunnels(options, link); }, CTL_OK),
-              "data plane kernel: ip_gre is there\n  refused by reason:  source 9\n"
+              "data plane user\n  not used: kernel: no GRE\n  refused by reason:  source 9\n"
               "tunnel 3  10.0.0.101 to 10.0.0.1  on wccp0  index 12\n"
               "  in 1.2M (1.0G bytes)  out 0 (0 bytes)  fragments 4\n"
               "  sorted: in 7  to proxy 0  returned 0  own 3\n  refused by reason:  flags 2\n"
               "refused 9 from 10.0.0.9\naccepted 10.0.0.8\n"
+              "all packets are returned: no tproxy\nthe kernel is not as wanted: wccp0: busy?\n"
               "the router redirects this appliance's own traffic\n"
               "refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
               "packets come in fragments, and the MSS of no flow has been clamped\n");

@@ -8,6 +8,8 @@
 #include "peers/mgmtctl/group_words.h"
 #include "peers/nodes/schema.h"
 
+static const char *const PORT_AND_ALL = "\"port\" and \"all\" exclude each other";
+
 static bool is_nothing(const std::string &value) {
     return value == "default" || value == "none";
 }
@@ -36,7 +38,9 @@ static std::string take_list(const intercept_word &row, const std::vector<std::s
     if (list.empty())
         return needs_value(row);
     const auto [at, fresh] = inout->emplace(row.node, list);
-    if (!fresh && (!at->second || at->second->empty() || at->second == "all"))
+    if (!fresh && at->second == "all")
+        return PORT_AND_ALL;
+    if (!fresh && !at->second)
         return std::string("\"") + row.word + "\" is given twice";
     if (!fresh)
         *at->second += " " + list;
@@ -52,7 +56,8 @@ static std::string take_ports(const intercept_word &row, const std::vector<std::
 
 static std::string take_all_ports(const intercept_word &row, const std::vector<std::string> &, size_t *,
                                   intercept_wish *inout) {
-    return inout->emplace(row.node, "all").second ? "" : "\"port\" and \"all\" exclude each other";
+    const auto [at, fresh] = inout->emplace(row.node, "all");
+    return fresh ? "" : at->second == "all" ? "\"all\" is given twice" : PORT_AND_ALL;
 }
 
 static std::string take_prefixes(const intercept_word &row, const std::vector<std::string> &words,
@@ -88,15 +93,15 @@ const std::vector<intercept_word> &intercept_words() {
         {"to", "to", "the port that the proxy listens on", take_one},
         {"bypass", "bypass", "prefixes of clients or servers that are left alone: 10.0.0.0/8; or none",
          take_prefixes},
-        {"rest", "rest", "what nobody wants: return to the router, forward by the routing table, or drop",
-         take_one},
+        {"rest", "rest",
+         "packets that nobody wants: return to the router, forward by the routing table, or drop", take_one},
         {"down", "down", "wanted flows while the proxy is down: return to the router, or drop", take_one},
-        {"check", "check", "of the proxy's health: tcp, http PATH, or command FILE", take_check},
+        {"check", "check", "how the proxy is checked: tcp, http PATH, or command FILE", take_check},
         {"interval", "interval", "seconds from one check to the next, 1 to 3600", take_one},
-        {"rise", "rise", "good checks until the proxy counts as up, 1 to 100", take_one},
-        {"fall", "fall", "failed checks until it counts as down, 1 to 100", take_one},
+        {"rise", "rise", "good checks in a row until the proxy counts as up, 1 to 100", take_one},
+        {"fall", "fall", "failed checks in a row until it counts as down, 1 to 100", take_one},
         {"leave", "leave_after",
-         "seconds of a proxy's being down until the group leaves its routers; 0: never", take_one},
+         "seconds that the proxy is down before the group leaves its routers; 0: never", take_one},
     };
     return words;
 }

@@ -2,8 +2,10 @@
 // is no use without a group that fits is noted, and done all the same: the group may come later.
 #include "peers/mgmtctl/intercepts.h"
 
+#include <chrono>
 #include <map>
 #include <optional>
+#include <thread>
 
 #include "mgmt/node_paths.h"
 #include "mgmt/protocol_names.h"
@@ -46,6 +48,24 @@ static bool read_nodes(const ctl_link &link, const std::string &root, node_texts
     return true;
 }
 
+// Whether there is a tunneld to follow the change. One that has just been started gets time for its session.
+static void look_for_tunneld(const ctl_link &link, traffic_result *inout) {
+    using clock = std::chrono::steady_clock;
+    const auto until = clock::now() + std::chrono::milliseconds(link.session_ms);
+    for (;;) {
+        ctl_reply reply;
+        std::string reason;
+        if (!link.query(ctl_walk::node, NODE_PLANE_STATE "/name", &reply, &reason))
+            return; // the change is made all the same
+        inout->tunneld = reply.code == LC_IO_TIMED_OUT                   ? "silent"
+                         : reply.code != LC_OK || reply.bindings.empty() ? "absent"
+                                                                         : "running";
+        if (inout->tunneld != "absent" || clock::now() >= until)
+            return;
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
+}
+
 static void commit(const ctl_link &link, const std::vector<ctl_change_item> &items, const char *done,
                    traffic_result *inout) {
     ctl_reply reply;
@@ -60,12 +80,7 @@ static void commit(const ctl_link &link, const std::vector<ctl_change_item> &ite
         inout->done = done;
     if (inout->exit != CTL_OK)
         return;
-    reply = {};
-    if (!link.query(ctl_walk::node, NODE_PLANE_STATE "/name", &reply, &reason))
-        return; // it is done all the same
-    inout->tunneld = reply.code == LC_IO_TIMED_OUT                   ? "silent"
-                     : reply.code != LC_OK || reply.bindings.empty() ? "absent"
-                                                                     : "running";
+    look_for_tunneld(link, inout);
 }
 
 static void remove_root(const ctl_link &link, const std::string &root, const char *done,
@@ -121,7 +136,7 @@ static std::string what_does_not_fit(const ctl_link &link, const std::string &nu
            " gets nothing";
 }
 
-static bool parse_group(const std::string &text, std::string *out) {
+bool parse_group_number(const std::string &text, std::string *out) {
     if (text.empty() || text.size() > 6 || text.find_first_not_of("0123456789") != std::string::npos)
         return false;
     *out = std::to_string(std::stol(text));
@@ -158,11 +173,14 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
     const std::string verb = words.empty() ? "" : words[0];
     if (verb != "add" && verb != "set" && verb != "delete")
         return failed(result, CTL_USAGE,
-                      verb.empty() ? USAGE
-                                   : unknown_word_text(verb, {"add", "set", "delete", "show", "words"}));
-    if (words.size() < 2 || !parse_group(words[1], &result.subject) ||
+                      verb.empty() || verb == "show" || verb == "words"
+                          ? USAGE
+                          : unknown_word_text(verb, {"add", "set", "delete", "show", "words"}));
+    std::string number;
+    if (words.size() < 2 || !parse_group_number(words[1], &number) ||
         (verb == "delete") != (words.size() == 2))
         return failed(result, CTL_USAGE, USAGE);
+    result.subject = number;
     intercept_wish wish;
     if (const std::string wrong = parse_intercept_wish(words, &wish); !wrong.empty())
         return failed(result, CTL_USAGE, wrong);
@@ -191,7 +209,8 @@ traffic_result bypass_command(const ctl_link &link, const std::vector<std::strin
     const std::string verb = words.empty() ? "" : words[0];
     if (verb != "add" && verb != "delete")
         return failed(result, CTL_USAGE,
-                      verb.empty() ? USAGE : unknown_word_text(verb, {"add", "delete", "show"}));
+                      verb.empty() || verb == "show" ? USAGE
+                                                     : unknown_word_text(verb, {"add", "delete", "show"}));
     if (words.size() != 2 && (verb == "delete" || words.size() != 4))
         return failed(result, CTL_USAGE, USAGE);
     result.subject = words[1].find('/') == std::string::npos ? words[1] + "/32" : words[1];
@@ -229,7 +248,8 @@ traffic_result tunnel_command(const ctl_link &link, const std::vector<std::strin
     const std::string verb = words.empty() ? "" : words[0];
     if (verb != "accept" && verb != "refuse")
         return failed(result, CTL_USAGE,
-                      verb.empty() ? USAGE : unknown_word_text(verb, {"accept", "refuse", "show"}));
+                      verb.empty() || verb == "show" ? USAGE
+                                                     : unknown_word_text(verb, {"accept", "refuse", "show"}));
     if (words.size() != 2 && (verb == "refuse" || words.size() != 4))
         return failed(result, CTL_USAGE, USAGE);
     if (words.size() == 4 && words[2] != "router")

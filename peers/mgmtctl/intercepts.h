@@ -18,6 +18,8 @@ struct traffic_result {
     std::string tunneld; // "running", "absent", "silent"; empty where it was not asked
 };
 
+// "051" as "51". False for what is no number.
+bool parse_group_number(const std::string &text, std::string *out);
 // `words` follow "intercept", "bypass" and "tunnel". Each command is one commit.
 traffic_result intercept_command(const ctl_link &link, const std::vector<std::string> &words);
 // `now` in seconds since 1970. mgmtd deletes a bypass whose time is over.

@@ -13,7 +13,8 @@ struct ctl_link {
         query;
     std::function<bool(const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *out_reason)>
         set;
-    int64_t settle_ms = 5000; // how long wccpd may take to follow
+    int64_t settle_ms = 5000;  // how long wccpd may take to follow
+    int64_t session_ms = 3000; // how long tunneld may take to open its session
 };
 
 // A link whose session begins with its first request and ends with the last copy: wrong words are reported

@@ -108,6 +108,10 @@ static void take_plane(const std::vector<std::string> &parts, const std::string 
         out->plane = clean_text(value, 15);
     else if (parts[0] == "reason")
         out->plane_reason = clean_text(value, 127);
+    else if (parts[0] == "lack")
+        out->lack = clean_text(value, 255);
+    else if (parts[0] == "failure")
+        out->failure = clean_text(value, 255);
     else if (parts[0] == "own")
         out->own = number(value);
     else if (parts[0] == "clamped")
@@ -246,6 +250,16 @@ static void fragments(const traffic_state &state, const reason_list &list) {
         list.add("packets come in fragments, and the MSS of no flow has been clamped");
 }
 
+static void lacking_kernel(const traffic_state &state, const reason_list &list) {
+    if (!state.lack.empty())
+        list.add("all packets are returned: " + state.lack);
+}
+
+static void failing_kernel(const traffic_state &state, const reason_list &list) {
+    if (!state.failure.empty())
+        list.add("the kernel is not as wanted: " + state.failure);
+}
+
 static void left_groups(const traffic_state &state, const reason_list &list) {
     for (const auto &[group, reason] : state.left)
         list.add("group " + std::to_string(group) + " has left its routers" + (reason.empty() ? "" : ": ") +
@@ -274,8 +288,14 @@ std::vector<traffic_reason> traffic_reasons(const traffic_state &state) {
         const char *word;
         void (*look)(const traffic_state &state, const reason_list &list);
     } rows[] = {
-        {"left", left_groups},        {"proxy_down", proxies_down},        {"standing_by", standing_by},
-        {"own_traffic", own_traffic}, {"refused_source", refused_sources}, {"fragments", fragments},
+        {"lack", lacking_kernel},
+        {"failure", failing_kernel},
+        {"left", left_groups},
+        {"proxy_down", proxies_down},
+        {"standing_by", standing_by},
+        {"own_traffic", own_traffic},
+        {"refused_source", refused_sources},
+        {"fragments", fragments},
     };
     std::vector<traffic_reason> out;
     for (const auto &row : rows)

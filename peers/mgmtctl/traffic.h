@@ -39,8 +39,9 @@ enum class tunneld_condition { running, silent, absent };
 struct traffic_state {
     tunneld_condition tunneld = tunneld_condition::absent; // unless it is running, it has said nothing
     std::string plane, plane_reason;
-    uint64_t own = 0;     // redirected packets of this appliance itself
-    uint64_t clamped = 0; // SYN-ACKs
+    std::string lack, failure; // why packets cannot be sorted; what could not be changed in the kernel
+    uint64_t own = 0;          // redirected packets of this appliance itself
+    uint64_t clamped = 0;      // SYN-ACKs
     refused_counts refused;
     std::map<std::string, uint64_t> refused_sources; // packets by address
     std::vector<traffic_tunnel> tunnels;             // by id

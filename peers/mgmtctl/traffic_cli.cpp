@@ -45,7 +45,7 @@ static int tell_result(const ctl_options &options, const traffic_result &result)
             options, {result.exit, result.subject.empty() ? "" : subject, result.error, "", result.code});
     put(subject + " " + (result.done == "unchanged" ? "is as asked" : result.done) +
         (result.note.empty() ? "" : " (" + result.note + ")") +
-        (result.tunneld == "absent"   ? "; tunneld is not running"
+        (result.tunneld == "absent"   ? "; tunneld has no session"
          : result.tunneld == "silent" ? "; tunneld does not answer"
                                       : "") +
         "\n");
@@ -97,7 +97,7 @@ struct asking {
 
 static void put_absence(tunneld_condition condition) {
     if (condition != tunneld_condition::running)
-        put(condition == tunneld_condition::absent ? "tunneld is not running\n"
+        put(condition == tunneld_condition::absent ? "tunneld has no session\n"
                                                    : "tunneld does not answer\n");
 }
 
@@ -181,8 +181,10 @@ static int list_clauses(const ctl_options &options) {
 }
 
 int ctl_intercept(const ctl_options &options, const std::vector<std::string> &words) {
-    if (!words.empty() && words[0] == "show" && words.size() <= 2)
-        return tell_intercepts(options, link_to_mgmtd(options), words.size() == 2 ? words[1] : "");
+    std::string only;
+    if (!words.empty() && words[0] == "show" &&
+        (words.size() == 1 || (words.size() == 2 && parse_group_number(words[1], &only))))
+        return tell_intercepts(options, link_to_mgmtd(options), only);
     if (words.size() == 1 && words[0] == "words")
         return list_clauses(options);
     return tell_result(options, intercept_command(link_to_mgmtd(options), words));
@@ -237,8 +239,9 @@ static std::string count_of_bytes(const traffic_count &count) {
 }
 
 static void put_tunnels(const traffic_state &traffic) {
-    put("data plane " + traffic.plane + (traffic.plane_reason.empty() ? "" : ": " + traffic.plane_reason) +
-        "\n" + refused_text(traffic.refused));
+    put("data plane " + traffic.plane + "\n" +
+        (traffic.plane_reason.empty() ? "" : "  not used: " + traffic.plane_reason + "\n") +
+        refused_text(traffic.refused));
     for (const traffic_tunnel &tunnel : traffic.tunnels)
         put("tunnel " + std::to_string(tunnel.id) + "  " + tunnel.local + " to " + tunnel.remote +
             (tunnel.interface.empty() ? "" : "  on " + tunnel.interface) + "  index " +

@@ -50,6 +50,8 @@ ctl_json traffic_json(const traffic_state &state) {
     ctl_json out = {{"tunneld", tunneld_word(state.tunneld)},
                     {"plane", text_or_null(state.plane)},
                     {"plane_reason", text_or_null(state.plane_reason)},
+                    {"lack", text_or_null(state.lack)},
+                    {"failure", text_or_null(state.failure)},
                     {"clamped", running ? ctl_json(state.clamped) : ctl_json(nullptr)},
                     {"refused", state.refused},
                     {"refused_sources", state.refused_sources},
