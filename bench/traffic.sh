@@ -1,0 +1,246 @@
+#!/bin/bash
+# traffic.sh [BIN [PART...]]: what the user-space data plane carries, beside plain forwarding by the kernel between the
+# same namespaces in the same run. The parts, all of them unless some are named:
+#   tcp       throughput to the proxy's socket, and the appliance's processor time for a megabyte
+#   packets   packets of 64 bytes a second, of 4096 flows and of one, and the loss at half of that rate
+#   upload    100 MB by full-size packets, whose GRE packets are fragmented, to a server: the longest pause
+#   orders    from the order of a tunnel to the first packet, under way and after a quiet minute
+#   start     32 tunnels and 256 intercepts: rules, routes and links made, found again, and taken over
+#   idle      wake-ups of tunneld after a quiet minute
+#
+# What is compared. The client, the router and the switch have processor 0, the appliance has processor 1: what it
+# receives is processed there (receive packet steering), its programs are bound to it. Both ways the appliance gets
+# packets of its MTU one by one, since veth has no receive offload unless it is asked for, and TCP segmentation is
+# done before. Plain, `tcp` goes from the client through the router's kernel to a socket of the appliance; redirected,
+# through GRE and the packet ring into the TUN device and to the same socket by TPROXY. `packets` are forwarded by the
+# appliance, plain or, for redirected ones, as `rest` says. Processor time is all of processor 1, interrupts included,
+# without idling; what the router does for GRE is not in it. Rounds alternate, the result is the median of their
+# ratios. A round during which others had more than 5 % of processor 1 is measured again.
+#   TRAFFIC_SECONDS    of a round (4)          TRAFFIC_ROUNDS    (5)
+#   TRAFFIC_LOSS_SECONDS   of the loss (60)    TRAFFIC_QUIET     seconds of quiet (61)
+set -u
+top=$(cd "$(dirname "$0")/.." && pwd)
+export WCCP_BIN=${1:-$top/build/release/bin}
+: "${TRAFFIC_SECONDS:=4}" "${TRAFFIC_ROUNDS:=5}" "${TRAFFIC_LOSS_SECONDS:=60}" "${TRAFFIC_QUIET:=61}"
+export LAB_PLANE=user
+# shellcheck source=../lab/topology.sh
+source "$top/lab/topology.sh"
+lab_enter "$0" "$@"
+[ $# -gt 0 ] && shift
+parts=("$@"); [ $# -gt 0 ] || parts=(tcp packets upload orders start idle)
+load=$WCCP_BIN/traffic_load
+die() { echo "$*" >&2; tail -n 12 "$LAB"/*.log "$LAB"/*.out >&2; exit 1; }
+
+# ---- the network
+
+on() { # PROCESSOR NODE COMMAND...
+    lab_in "$2" taskset -c "$1" "${@:3}"
+}
+steer() { # NODE DEVICE PROCESSOR: what the device receives is processed there; "-" is the switch
+    # shellcheck disable=SC2016
+    local script='mount -t sysfs sysfs /sys && echo "$2" >"/sys/class/net/$1/queues/rx-0/rps_cpus"'
+    local where=(); [ "$1" = - ] || where=(nsenter -t "${LAB_INIT[$1]}" --net)
+    "${where[@]}" unshare --mount bash -c "$script" - "$2" "$((1 << $3))" || die "$2 of $1 is not steered"
+}
+set_up() {
+    lab_router r1 10.0.0.1 -- --forward gre --return gre
+    lab_client c1 r1
+    lab_server s1 r1
+    lab_appliance a1 10.0.0.101
+    lab_gateway a1 10.0.0.1
+    lab_start a1 proxy "$(command -v taskset)" -c 1 "$load" sink 3129
+    on 0 s1 "$load" sink 8000 &
+    lab_appliance_start a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
+    lab_wait_role 60 a1 51 ACTIVE || die "no role"
+    lab_wait 20 '.[] | select(.name == "/qv/tunneld/intercept/state/51/proxy") | .value == "up"' \
+        lab_manage a1 walk /qv/tunneld/intercept/state || die "the proxy is not up"
+    tunneld=$(lab_pid a1 tunneld)
+    taskset -a -p -c 1 "$tunneld" >/dev/null
+    proxy=$(lab_pid a1 proxy)
+    # The router's end of the tunnel; what comes out of it has come from the appliance.
+    on 0 r1 "$load" router 10.0.0.1 10.0.0.101 gre0 >"$LAB/gre0.out" 2>&1 & router=$!
+    lab_wait_line 5 ready "$LAB/gre0.out" || die "no router"
+    # shellcheck disable=SC2016
+    lab_in r1 bash -c 'cd /proc/sys/net/ipv4
+        for name in all gre0 eth0 default; do echo 0 >conf/$name/rp_filter; echo 0 >conf/$name/send_redirects; done
+        echo 1 >ip_forward
+        ip link set gre0 up mtu 1500
+        ip rule add iif c1 to 10.2.0.0/24 preference 90 lookup 90
+        ip route add default dev gre0 table 90'
+    lab_in r1 "$load" split eth0
+    # What the appliance forwards plainly goes out where it came in.
+    lab_in a1 bash -c 'cd /proc/sys/net/ipv4/conf
+        for name in all eth0; do echo 0 >$name/send_redirects; done; echo 1 >eth0/forwarding'
+    steer a1 eth0 1
+    steer - v-a1 0
+    mac=$(lab_in a1 ip -j link show eth0 | jq -r '.[0].address')
+    # Of the small packets only the number is wanted.
+    nft 'add table netdev lab; add chain netdev lab small { type filter hook ingress device "v-a1" priority 0; }
+        add rule netdev lab small udp dport 9 drop' || die "no filter"
+}
+rest_is() { # return|forward
+    lab_configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 rest="$1")" || die "not configured"
+    sleep 1
+}
+
+# ---- measuring
+
+# Of processor 1, in ticks: busy, user time of others than tunneld and the proxy, all.
+ticks() {
+    cat "/proc/$tunneld/stat" "/proc/$proxy/stat" /proc/stat | awk '
+        FNR == NR && $1 ~ /^[0-9]/ { sub(/.*\)/, ""); own += $12 }
+        $1 == "cpu1" { for (i = 2; i <= 9; i++) all += $i; idle = $5 + $6; user = $2 + $3 }
+        END { print all - idle, user - own, all }'
+}
+measure() { # COMMAND... : sets out, busy (seconds of processor 1), others (share)
+    local before after
+    before=$(ticks)
+    out=$("$@") || die "$* failed"
+    after=$(ticks)
+    read -r busy others share < <(awk -v before="$before" -v after="$after" -v hertz="$(getconf CLK_TCK)" 'BEGIN {
+        split(before, b); split(after, a)
+        print (a[1] - b[1]) / hertz, (a[2] - b[2]) / (a[3] - b[3]), (a[1] - b[1]) / (a[3] - b[3]) }')
+    quiet=$(awk "BEGIN { print ($others < ${TRAFFIC_OTHERS:-0.05}) }")
+}
+median() { sort -g | awk '{ at[NR] = $1 } END { print NR % 2 ? at[(NR + 1) / 2] : (at[NR / 2] + at[NR / 2 + 1]) / 2 }'; }
+sent_by_a1() { cat /proc/net/dev | awk '$1 == "v-a1:" { print $3 }'; }
+
+# Rounds one way and the other until enough pairs were quiet. One line of each pair: rate, cost and share of processor 1
+# plain, then redirected.
+rounds() { # FUNCTION THAT SETS rate AND cost, GIVEN plain OR redirected
+    local good=0 attempts=0 pair way calm
+    : >"$LAB/$1.rounds"
+    while [ $good -lt "$TRAFFIC_ROUNDS" ]; do
+        attempts=$((attempts + 1)) pair='' calm=1
+        for way in plain redirected; do
+            "$1" $way
+            pair+="$rate $cost $share "
+            [ "$quiet" = 1 ] || calm=0
+        done
+        [ -z "${TRAFFIC_VERBOSE-}" ] || echo "    $1: $pair others $others"
+        if [ $calm = 0 ]; then
+            [ $attempts -lt $((4 * TRAFFIC_ROUNDS)) ] || die "$1: the machine is too busy"
+            continue
+        fi
+        echo "$pair" >>"$LAB/$1.rounds"
+        good=$((good + 1))
+    done
+    [ $attempts = $good ] || echo "($((attempts - good)) rounds were disturbed and measured again)"
+}
+of_rounds() { # FUNCTION AWK: the median of an expression
+    awk "{ print $2 }" "$LAB/$1.rounds" | median
+}
+figure() { # NAME VALUE WANTED: a number beside its limit, "<= 50" or ">= 0.9"
+    local verdict
+    verdict=$(awk "BEGIN { print ($2 $3 ? \"\" : \"  MISSED\") }")
+    printf '%-64s %10s   (wanted %s)%s\n' "$1" "$2" "$3" "$verdict"
+    [ -z "$verdict" ] || missed=1
+}
+missed=0
+
+# ---- the parts
+
+tcp() { # plain|redirected
+    local to=(10.0.0.101 3129)
+    [ "$1" = plain ] || to=(10.2.0.2 80)
+    measure on 0 c1 "$load" source "${to[@]}" "$TRAFFIC_SECONDS" 0
+    rate=$(jq '.bytes / .seconds / 1e6' <<<"$out")
+    cost=$(jq ".bytes as \$bytes | $busy * 1e9 / \$bytes" <<<"$out") # milliseconds for a megabyte
+}
+part_tcp() {
+    tcp redirected # ARP, caches
+    rounds tcp
+    printf '%-24s %10s %16s %22s\n' 'TCP to the proxy' 'MB/s' 'cpu 1, ms/MB' 'cpu 1, share of time'
+    printf '%-24s %10.0f %16.3f %22.2f\n' plain "$(of_rounds tcp '$1')" "$(of_rounds tcp '$2')" "$(of_rounds tcp '$3')" \
+        redirected "$(of_rounds tcp '$4')" "$(of_rounds tcp '$5')" "$(of_rounds tcp '$6')"
+    figure 'throughput, redirected to plain' "$(of_rounds tcp '$4 / $1')" '>= 0.9'
+    figure 'processor time for a megabyte, redirected to plain' "$(of_rounds tcp '$5 / $2')" '<= 1.3'
+}
+
+send_small() { # plain|gre FLOWS RATE SECONDS: sets sent and delivered
+    local before
+    before=$(sent_by_a1)
+    measure taskset -c 0 "$load" packets v-a1 "$mac" "$@"
+    sleep 0.2
+    sent=$(jq .sent <<<"$out")
+    delivered=$(($(sent_by_a1) - before))
+}
+flows=4096
+small() { # plain|redirected: the sender gives all it can
+    local kind=plain
+    [ "$1" = plain ] || kind=gre
+    send_small $kind $flows 0 "$TRAFFIC_SECONDS"
+    rate=$(jq "$delivered / .seconds / 1000" <<<"$out")
+    cost=$(awk "BEGIN { print $busy * 1e6 / $delivered }")
+}
+part_packets() {
+    rest_is forward
+    printf '%-24s %10s %16s %22s\n' '64-byte packets' '1000/s' 'cpu 1, us each' 'cpu 1, share of time'
+    for flows in 1 4096; do
+        rounds small
+        printf '%-24s %10.0f %16.2f %22.2f\n' "plain, $flows flows" "$(of_rounds small '$1')" "$(of_rounds small '$2')" \
+            "$(of_rounds small '$3')" "redirected, $flows flows" "$(of_rounds small '$4')" "$(of_rounds small '$5')" \
+            "$(of_rounds small '$6')"
+        figure "packets a second of $flows flows, redirected to plain" "$(of_rounds small '$4 / $1')" '>= 0.5'
+    done
+    local half
+    half=$(of_rounds small '$4 * 500')
+    send_small gre 4096 "$half" "$TRAFFIC_LOSS_SECONDS"
+    figure "lost of $sent packets at ${half%.*} a second in $TRAFFIC_LOSS_SECONDS s" $((sent - delivered)) '<= 0'
+    [ "$sent" = "$delivered" ] || lab_manage a1 walk /qv/tunneld | jq -c '.[] | select((.value // 0) != 0) | [.name, .value]' |
+        grep -E 'refused|packets'
+    rest_is return
+}
+
+part_upload() {
+    measure on 0 c1 "$load" source 10.2.0.2 8000 0 100000000
+    echo "upload: $out"
+    figure 'upload of 100 MB through the appliance, longest pause (s)' "$(jq .longest_pause <<<"$out")" '< 1'
+    figure 'its segment size' "$(jq .mss <<<"$out")" '>= 1448'
+}
+
+part_orders() {
+    local times=$LAB/orders i
+    lab_alone "$WCCP_BIN/tunneld_timed" orders "$WCCP_BIN/tunneld" 50 0 >"$times" || die 'orders failed'
+    figure 'tunnel ordered to first packet, one after the other: median (ms)' "$(awk '{ print $2 }' "$times" | median)" '< 50'
+    figure '                                                     maximum (ms)' "$(awk '{ print $2 }' "$times" | sort -g | tail -n 1)" '< 50'
+    : >"$times"
+    local waiting=()
+    for i in $(seq 50); do # side by side, each in an appliance of its own, at moments of its own
+        lab_alone "$WCCP_BIN/tunneld_timed" orders "$WCCP_BIN/tunneld" 1 "$((TRAFFIC_QUIET + i / 5)).$((RANDOM % 900 + 100))" \
+            >>"$times" & waiting+=($!)
+    done
+    wait "${waiting[@]}"
+    [ "$(wc -l <"$times")" = 50 ] || die 'orders after quiet failed'
+    figure 'tunnel ordered to first packet, after a quiet minute: median (ms)' "$(awk '{ print $2 }' "$times" | median)" '< 50'
+    figure '                                                      maximum (ms)' "$(awk '{ print $2 }' "$times" | sort -g | tail -n 1)" '< 50'
+}
+lab_alone() { "$LAB_HOME/in-appliance" "$@"; }
+
+part_start() {
+    lab_alone "$WCCP_BIN/tunneld_timed" reconcile user 32 256 >"$LAB/start" || die 'start failed'
+    local what ms
+    while IFS=: read -r what ms; do
+        figure "32 tunnels, 256 intercepts $what (ms)" "${ms% ms}" '< 2000'
+    done <"$LAB/start"
+}
+
+switches() { awk '/^voluntary_ctxt_switches/ { sum += $2 } END { print sum }' "/proc/$tunneld"/task/*/status; }
+part_idle() {
+    local before
+    sleep "$TRAFFIC_QUIET"
+    before=$(switches)
+    sleep 10
+    figure 'wake-ups of tunneld in a second, one intercept, quiet' "$(awk "BEGIN { print ($(switches) - $before) / 10 }")" '<= 20'
+}
+
+for part in "${parts[@]}"; do
+    case $part in tcp | packets | upload | idle) [ -n "${tunneld-}" ] || set_up ;; esac
+    "part_$part"
+done
+if [ -n "${tunneld-}" ]; then
+    kill "$router"; wait "$router"
+    tail -n 1 "$LAB/gre0.out"
+    lab_end a1 || die "the appliance does not end in order"
+fi
+exit $missed
