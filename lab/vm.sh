@@ -16,7 +16,7 @@ top=$(cd "$(dirname "$0")/.." && pwd)
 : "${WCCP_BIN:=$top/build/release/bin}" "${VM_LIMIT:=330}" "${VM_ACCEL:=}"
 vm=$top/build/vm
 run=$vm/run
-export LC_ALL=C TMPDIR=$run
+export LC_ALL=C TMPDIR=$run PATH=$PATH:/usr/sbin:/sbin
 
 programs=(wccpd mgmtd mgmtctl tunneld wccp_router)
 packages=(base-files bash coreutils sed grep mawk findutils diffutils util-linux mount procps iproute2 nftables jq

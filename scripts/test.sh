@@ -1,13 +1,14 @@
 #!/bin/bash
 # test.sh: everything that a change has to pass, from a bare checkout on Debian 12: the format of the sources and their includes, all tests
 # under release and under the address and undefined-behaviour sanitizers, those with threads under the thread
-# sanitizer, a short run of each fuzzer. Installs what is missing; leaves nothing but build/.
-#   test.sh [STEP...]   only these steps, of: form release asan tsan clang tidy fuzz
+# sanitizer, a short run of each fuzzer, and what needs Debian's own kernel in a virtual machine. Installs what is
+# missing; leaves nothing but build/.
+#   test.sh [STEP...]   only these steps, of: form release asan tsan clang tidy fuzz vm
 set -u
 cd "$(dirname "$0")/.." || exit 1
 scripts/install-deps.sh build lab test || exit 1
 jobs=$(nproc)
-steps=("$@"); [ $# -gt 0 ] || steps=(form release asan tsan clang fuzz)
+steps=("$@"); [ $# -gt 0 ] || steps=(form release asan tsan clang fuzz vm)
 passed=0 failed=0
 declare -a bad=() second=()
 
@@ -16,9 +17,9 @@ result() { # NAME STATUS
     if [ "$2" = 0 ]; then passed=$((passed + 1)); else failed=$((failed + 1)); bad+=("$1"); fi
 }
 sources() { git ls-files -co --exclude-standard '*.cpp' '*.h'; }
-build() { # PRESET [TARGET]
+build() { # PRESET [TARGET...]
     cmake --preset "$1" >"build/$1.log" 2>&1 &&
-        cmake --build --preset "$1" -j "$jobs" ${2:+--target "$2"} >>"build/$1.log" 2>&1 ||
+        cmake --build --preset "$1" -j "$jobs" ${2:+--target "${@:2}"} >>"build/$1.log" 2>&1 ||
         { tail -n 40 "build/$1.log"; return 1; }
 }
 run_ctest() { # PRESET ARGUMENTS...
@@ -39,6 +40,19 @@ run_ctest() { # PRESET ARGUMENTS...
     passed=$((passed + ${total:-0} - ${fails:-0})); failed=$((failed + ${fails:-0}))
     if [ $status -ne 0 ]; then bad+=("tests under $preset"); [ "${fails:-0}" -gt 0 ] || failed=$((failed + 1)); fi
 }
+run_vm() {
+    if ! scripts/install-deps.sh vm >build/vm.log 2>&1; then
+        tail -n 3 build/vm.log
+        echo 'skipped: qemu cannot be installed here'
+        return
+    fi
+    build release wccpd mgmtd mgmtctl tunneld wccp_router fast_clock || { result "build for the virtual machine" 1; return; }
+    lab/vm.sh | tee build/vm.log
+    local status=${PIPESTATUS[0]} fails
+    fails=$(grep -c '^FAILED ' build/vm.log)
+    passed=$((passed + $(grep -c '^ok ' build/vm.log))); failed=$((failed + fails))
+    if [ "$status" -ne 0 ]; then bad+=("virtual machine"); [ "$fails" -gt 0 ] || failed=$((failed + 1)); fi
+}
 
 mkdir -p build
 for step in "${steps[@]}"; do
@@ -55,6 +69,7 @@ for step in "${steps[@]}"; do
     tidy) cmake --preset clang >/dev/null && sources | grep '\.cpp$' | grep -vE '^(tests|bench|fuzz)/' |
         xargs -P "$jobs" -n 1 clang-tidy-14 --quiet -p build/clang; result "clang-tidy" $? ;;
     fuzz) scripts/fuzz.sh 15; result "fuzzing" $? ;;
+    vm) run_vm ;;
     *) echo "test.sh: no step $step" >&2; exit 2 ;;
     esac
     printf '%s: %d s\n' "$step" $((SECONDS - began))
