@@ -21,8 +21,8 @@ void *cmem_create_block(uint64_t length, const char *name);
 // The block that another process has created, read and write; null, with a line, on failure. `out_length`,
 // when given, gets the bytes that can be used: the segment in whole pages.
 void *cmem_attach_block(const char *name, uint64_t *out_length = nullptr);
-// The process that has created the block most recently; 0 when there is no such block. `out_lives`: whether it
-// still runs.
+// The process that has created the block most recently; 0 when there is no such block. `out_lives`: whether
+// it still runs.
 int32_t cmem_find_creator(const char *name, bool *out_lives);
 
 // A named mutex with default attributes.
