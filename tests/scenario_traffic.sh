@@ -7,7 +7,7 @@ set -u
 : "${LAB_SPEED:=4}" "${LAB_PLANE=}"
 export LAB_SPEED LAB_PLANE
 # shellcheck source=../lab/cases.sh
-source "$(dirname "$0")/../lab/cases.sh"
+source "$(dirname "${BASH_SOURCE[0]}")/../lab/cases.sh"
 lab_cases "$@"
 
 # The router between client c1, server s1 and the appliances; c1 is redirected by group 51 unless the options say more.
@@ -212,14 +212,6 @@ case_kills() {
     lab_proxy a1
     lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
     LAB_FOUND[a1]=$(lab_remains a1)
-    # mgmtd's patience is by the wall's clock.
-    local program
-    lab_clock
-    mkdir -p "/proc/${LAB_INIT[a1]}/root/run/wccpd"
-    for program in wccpd tunneld; do
-        printf '#!/bin/sh\nexec %s %s "$@"\n' "${LAB_CLOCK[*]}" "$WCCP_BIN/$program" >"/proc/${LAB_INIT[a1]}/root/run/wccpd/$program"
-        chmod +x "/proc/${LAB_INIT[a1]}/root/run/wccpd/$program"
-    done
     supervised
     ready 51 a1
     local wccpd i transfers results=$LAB/transfers
@@ -250,7 +242,15 @@ case_kills() {
     LAB_KILLED[a1]+='|uds-client-(wccpd|tunneld)-[0-9]+$'
     finish a1
 }
+# mgmtd, whose patience is by the wall's clock, with programs that run by the protocol's.
 supervised() {
+    local program directory=/proc/${LAB_INIT[a1]}/root/run/wccpd
+    lab_clock
+    mkdir -p "$directory"
+    for program in wccpd tunneld; do
+        printf '#!/bin/sh\nexec %s %s "$@"\n' "${LAB_CLOCK[*]}" "$WCCP_BIN/$program" >"$directory/$program"
+        chmod +x "$directory/$program"
+    done
     : >"$LAB/a1-mgmtd.out"
     lab_start a1 mgmtd mgmtd --config "$LAB_CONFIG" --supervise --wccpd /run/wccpd/wccpd --tunneld /run/wccpd/tunneld
     role a1 60 51 ACTIVE

@@ -181,6 +181,7 @@ int run_web(const web_options &options) {
         place.sin_family = AF_INET;
         place.sin_port = htons(port);
         setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
+        setsockopt(fd, IPPROTO_IP, IP_TRANSPARENT, &one, sizeof one); // also serves what TPROXY gives it
         if (fd < 0 || bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0 ||
             listen(fd, 1024) != 0) {
             perror("web");
