@@ -25,17 +25,16 @@ case_throughput() {
     local i ratios=() plain carried median
     upload plain 10.0.0.101 3129 >/dev/null
     upload carried 10.2.0.2 80 >/dev/null
-    for ((i = 1; i <= 33; i++)); do
+    for ((i = 0; i < 15; i++)); do # a fixed number: stopping at a good ratio would favour it
         upload plain 10.0.0.101 3129
         upload carried 10.2.0.2 80
         ratios+=("$(jq -n "$carried / $plain")")
-        median=$(printf '%s\n' "${ratios[@]}" | jq -s 'sort | .[length / 2 | floor]')
-        # The machine may be busy: the more often, the nearer to the truth.
-        [ $((i % 11)) != 0 ] || [ "$(jq -n "$median >= 0.9")" = false ] || break
     done
+    median=$(printf '%s\n' "${ratios[@]}" | jq -s 'sort | .[length / 2 | floor]')
     figure "throughput by GRE to the proxy: $(jq -n "$median * 100 | round / 100") of plain forwarding (median of ${#ratios[@]} pairs)"
     [ "$(jq -n "$median >= 0.9")" = true ] || die "too slow: ${ratios[*]}"
-    state_is a1 10 intercept '.["51"].to_proxy_bytes >= 200000000'
+    # All of it was carried, and none of it given back.
+    state_is a1 10 tunnel ".[] | .bytes_in >= 300000000 and .packets_out == 0"
     lab_stop a1 sink
     finish a1
 }
