@@ -1,0 +1,179 @@
+// traffic_wrap DEVICE: until SIGTERM, what leaves by DEVICE for 10.2.0.2 goes in GRE from 10.0.0.1
+// to 10.0.0.101, as a router sends the packets that it redirects for the dynamic service 51. For
+// bench/traffic.sh: a BPF program in the device's way out costs the router so little, and leaves packets in
+// such batches, that the appliance is what is measured. The program goes with the process.
+#include <arpa/inet.h>
+#include <linux/bpf.h>
+#include <linux/if_ether.h>
+#include <net/if.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <csignal>
+#include <cstddef>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <iterator>
+
+namespace {
+
+constexpr uint32_t ROUTER = 0x0a000001, APPLIANCE = 0x0a000065, SERVER = 0x0a020002;
+constexpr int IP_HEADER = 20, WRAPPING = IP_HEADER + 4 + 4; // GRE, redirect header
+constexpr uint16_t TTL_AND_GRE = 64 << 8 | 47;
+// Newer than the headers of this system.
+constexpr uint32_t ATTACH_EGRESS = 47; // BPF_TCX_EGRESS
+constexpr int NEXT_PROGRAM = -1;       // TCX_NEXT
+struct link_request {
+    uint32_t program, device, attach_type, flags;
+    uint32_t relative, padding;
+    uint64_t expected_revision;
+};
+
+constexpr uint8_t R0 = 0, R1 = 1, R2 = 2, R3 = 3, R4 = 4, R5 = 5, PACKET = 6, LENGTH = 7, SUM = 8, FRAME = 10;
+constexpr bpf_insn op(int code, uint8_t to, uint8_t from, int offset, int value) {
+    bpf_insn made = {};
+    made.code = static_cast<uint8_t>(code);
+    made.dst_reg = to & 15;
+    made.src_reg = from & 15;
+    made.off = static_cast<int16_t>(offset);
+    made.imm = value;
+    return made;
+}
+constexpr bpf_insn set(uint8_t to, int value) {
+    return op(BPF_ALU64 | BPF_MOV | BPF_K, to, 0, 0, value);
+}
+constexpr bpf_insn copy(uint8_t to, uint8_t from) {
+    return op(BPF_ALU64 | BPF_MOV | BPF_X, to, from, 0, 0);
+}
+constexpr bpf_insn with(int operation, uint8_t to, int value) {
+    return op(BPF_ALU64 | operation | BPF_K, to, 0, 0, value);
+}
+constexpr bpf_insn load(uint8_t to, uint8_t from, int offset) {
+    return op(BPF_LDX | BPF_MEM | BPF_W, to, from, offset, 0);
+}
+constexpr bpf_insn store(int size, int offset, int value) {
+    return op(BPF_ST | BPF_MEM | size, FRAME, 0, offset, value);
+}
+constexpr bpf_insn call(int function) {
+    return op(BPF_JMP | BPF_CALL, 0, 0, 0, function);
+}
+// The number in the register as 16 bits on the wire, into the frame.
+constexpr bpf_insn to_wire(uint8_t reg) {
+    return op(BPF_ALU | BPF_END | BPF_TO_BE, reg, 0, 0, 16);
+}
+constexpr bpf_insn store_half(int offset, uint8_t from) {
+    return op(BPF_STX | BPF_MEM | BPF_H, FRAME, from, offset, 0);
+}
+int word(uint32_t host_order) {
+    return static_cast<int>(htonl(host_order));
+}
+
+[[noreturn]] void die(const char *what) {
+    fprintf(stderr, "traffic_wrap: %s: %s\n", what, strerror(errno));
+    exit(1);
+}
+int call_bpf(int command, void *request, size_t size) {
+    return static_cast<int>(syscall(SYS_bpf, command, request, size));
+}
+
+int load_program() {
+    constexpr int AT = -32; // the wrapping in the frame
+    constexpr int constant = 0x4500 + TTL_AND_GRE + (ROUTER >> 16) + (ROUTER & 0xffff) + (APPLIANCE >> 16) +
+                             (APPLIANCE & 0xffff); // in the sum of the header
+    bpf_insn code[] = {
+        copy(PACKET, R1),
+        load(R1, PACKET, offsetof(__sk_buff, protocol)),
+        op(BPF_JMP | BPF_JNE | BPF_K, R1, 0, 0, htons(ETH_P_IP)),
+        copy(R1, PACKET),
+        set(R2, ETH_HLEN + 16),
+        copy(R3, FRAME),
+        with(BPF_ADD, R3, -4),
+        set(R4, 4),
+        call(BPF_FUNC_skb_load_bytes),
+        op(BPF_JMP | BPF_JNE | BPF_K, R0, 0, 0, 0),
+        load(R1, FRAME, -4),
+        op(BPF_JMP32 | BPF_JNE | BPF_K, R1, 0, 0, word(SERVER)),
+        copy(R1, PACKET),
+        set(R2, WRAPPING),
+        set(R3, BPF_ADJ_ROOM_MAC),
+        set(R4, 0),
+        call(BPF_FUNC_skb_adjust_room),
+        op(BPF_JMP | BPF_JNE | BPF_K, R0, 0, 0, 0),
+        load(LENGTH, PACKET, offsetof(__sk_buff, len)),
+        with(BPF_SUB, LENGTH, ETH_HLEN),
+        copy(SUM, LENGTH),
+        with(BPF_ADD, SUM, constant),
+        copy(R1, SUM), // folded twice
+        with(BPF_RSH, R1, 16),
+        with(BPF_AND, SUM, 0xffff),
+        op(BPF_ALU64 | BPF_ADD | BPF_X, SUM, R1, 0, 0),
+        copy(R1, SUM),
+        with(BPF_RSH, R1, 16),
+        op(BPF_ALU64 | BPF_ADD | BPF_X, SUM, R1, 0, 0),
+        with(BPF_XOR, SUM, 0xffff),
+        to_wire(SUM),
+        to_wire(LENGTH),
+        store(BPF_H, AT, htons(0x4500)),
+        store_half(AT + 2, LENGTH),
+        store(BPF_W, AT + 4, 0),
+        store(BPF_H, AT + 8, htons(TTL_AND_GRE)),
+        store_half(AT + 10, SUM),
+        store(BPF_W, AT + 12, word(ROUTER)),
+        store(BPF_W, AT + 16, word(APPLIANCE)),
+        store(BPF_W, AT + 20, word(0x0000883e)),
+        store(BPF_W, AT + 24, word(0x80330000)),
+        copy(R1, PACKET),
+        set(R2, ETH_HLEN),
+        copy(R3, FRAME),
+        with(BPF_ADD, R3, AT),
+        set(R4, WRAPPING),
+        set(R5, 0),
+        call(BPF_FUNC_skb_store_bytes),
+        set(R0, NEXT_PROGRAM), // all jumps come here
+        op(BPF_JMP | BPF_EXIT, 0, 0, 0, 0),
+    };
+    constexpr size_t count = std::size(code);
+    for (size_t i = 0; i < count; i++)
+        if (code[i].code == (BPF_JMP | BPF_JNE | BPF_K) || code[i].code == (BPF_JMP32 | BPF_JNE | BPF_K))
+            code[i].off = static_cast<int16_t>(count - 2 - i - 1);
+    static char log[65536];
+    bpf_attr request = {};
+    request.prog_type = BPF_PROG_TYPE_SCHED_CLS;
+    request.insns = reinterpret_cast<uintptr_t>(code);
+    request.insn_cnt = count;
+    request.license = reinterpret_cast<uintptr_t>("");
+    request.log_buf = reinterpret_cast<uintptr_t>(log);
+    request.log_size = sizeof log;
+    request.log_level = 1;
+    const int program = call_bpf(BPF_PROG_LOAD, &request, sizeof request);
+    if (program < 0) {
+        fputs(log, stderr);
+        die("program");
+    }
+    return program;
+}
+
+} // namespace
+
+int main(int argc, char **argv) {
+    const unsigned device = argc == 2 ? if_nametoindex(argv[1]) : 0;
+    if (device == 0)
+        die("a device?");
+    sigset_t ends;
+    sigemptyset(&ends);
+    sigaddset(&ends, SIGTERM);
+    sigprocmask(SIG_BLOCK, &ends, nullptr);
+    link_request request = {};
+    request.program = static_cast<uint32_t>(load_program());
+    request.device = device;
+    request.attach_type = ATTACH_EGRESS;
+    if (call_bpf(BPF_LINK_CREATE, &request, sizeof request) < 0)
+        die("link");
+    puts("ready");
+    fflush(stdout);
+    int number = 0;
+    sigwait(&ends, &number);
+    return 0;
+}
