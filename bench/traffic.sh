@@ -1,21 +1,24 @@
 #!/bin/bash
 # traffic.sh [BIN [PART...]]: what the user-space data plane carries, beside plain forwarding by the kernel between the
 # same namespaces in the same run. The parts, all of them unless some are named:
-#   tcp       throughput to the proxy's socket, and the appliance's processor time for a megabyte
+#   tcp       throughput to the proxy, and the appliance's processor time for a megabyte
 #   packets   packets of 64 bytes a second, of 4096 flows and of one, and the loss at half of that rate
 #   upload    100 MB by full-size packets, whose GRE packets are fragmented, to a server: the longest pause
 #   orders    from the order of a tunnel to the first packet, under way and after a quiet minute
 #   start     32 tunnels and 256 intercepts: rules, routes and links made, found again, and taken over
 #   idle      wake-ups of tunneld after a quiet minute
 #
-# What is compared. The client, the router and the switch have processor 0, the appliance has processor 1: what it
-# receives is processed there (receive packet steering), its programs are bound to it. Both ways the appliance gets
-# packets of its MTU one by one, since veth has no receive offload unless it is asked for, and TCP segmentation is
-# done before. Plain, `tcp` goes from the client through the router's kernel to a socket of the appliance; redirected,
-# through GRE and the packet ring into the TUN device and to the same socket by TPROXY. `packets` are forwarded by the
-# appliance, plain or, for redirected ones, as `rest` says. Processor time is all of processor 1, interrupts included,
-# without idling; what the router does for GRE is not in it. Rounds alternate, the result is the median of their
-# ratios. A round during which others had more than 5 % of processor 1 is measured again.
+# What is compared. The client, the router, the server and the switch have processor 0, the appliance has processor 1:
+# what it receives is processed there (receive packet steering), its programs are bound to it. In all ways the
+# appliance gets packets of its MTU one by one, since veth has no receive offload unless it is asked for, and TCP
+# segmentation is done before. Plain, the appliance's kernel forwards the client's TCP stream to a server beside it on
+# the switch, and what the server answers back to the client. Redirected, the stream comes through GRE and the packet
+# ring into the TUN device and by TPROXY to the proxy's socket. The socket line is for information: the stream is
+# addressed to a socket of the appliance, which is less work than forwarding each packet, since the kernel merges
+# segments on their way to a socket. `packets` are forwarded by the appliance, plain or, for redirected ones, as `rest`
+# says. Processor time is all of processor 1, interrupts included, without idling; what the router does for GRE is not
+# in it. Rounds alternate, the result is the median of their ratios. A round during which others had more than 5 % of
+# processor 1 is measured again.
 #   TRAFFIC_SECONDS    of a round (4)          TRAFFIC_ROUNDS    (5)
 #   TRAFFIC_LOSS_SECONDS   of the loss (60)    TRAFFIC_QUIET     seconds of quiet (61)
 set -u
@@ -47,10 +50,13 @@ set_up() {
     lab_router r1 10.0.0.1 -- --forward gre --return gre
     lab_client c1 r1
     lab_server s1 r1
+    lab_bare s2 && lab_plug s2 "${LAB_INIT[s2]}" 10.0.0.50
+    lab_gateway s2 10.0.0.101
     lab_appliance a1 10.0.0.101
     lab_gateway a1 10.0.0.1
     lab_start a1 proxy "$(command -v taskset)" -c 1 "$load" sink 3129
     on 0 s1 "$load" sink 8000 &
+    on 0 s2 "$load" sink 8000 &
     lab_appliance_start a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
     lab_wait_role 60 a1 51 ACTIVE || die "no role"
     lab_wait 20 '.[] | select(.name == "/qv/tunneld/intercept/state/51/proxy") | .value == "up"' \
@@ -66,6 +72,7 @@ set_up() {
         for name in all default eth0 c1; do echo 0 >conf/$name/rp_filter; echo 0 >conf/$name/send_redirects; done
         echo 1 >ip_forward
         ip rule add iif c1 to 10.2.0.0/24 preference 90 lookup 90
+        ip rule add iif c1 to 10.0.0.50 preference 91 lookup 90
         ip route add default via 10.0.0.101 dev eth0 table 90'
     lab_in c1 "$load" split eth0
     # What the appliance forwards plainly goes out where it came in.
@@ -85,12 +92,14 @@ rest_is() { # return|forward
 
 # ---- measuring
 
-# Of processor 1, in ticks: busy, user time of others than tunneld and the proxy, all.
+# Of processor 1, in seconds: busy, user time of others than tunneld and the proxy, all. Busy is what is not idle: the
+# kernel samples the rest by a tick, which stands still on an idle processor and misses most of the short interrupts.
 ticks() {
-    cat "/proc/$tunneld/stat" "/proc/$proxy/stat" /proc/stat | awk '
-        FNR == NR && $1 ~ /^[0-9]/ { sub(/.*\)/, ""); own += $12 }
-        $1 == "cpu1" { for (i = 2; i <= 9; i++) all += $i; idle = $5 + $6; user = $2 + $3 }
-        END { print all - idle, user - own, all }'
+    cat "/proc/$tunneld/stat" "/proc/$proxy/stat" /proc/stat /proc/uptime | awk -v hertz="$(getconf CLK_TCK)" '
+        $1 ~ /^[0-9]/ && NF > 2 { sub(/.*\)/, ""); own += $12 }
+        $1 == "cpu1" { idle = $5 + $6; user = $2 + $3 }
+        NF == 2 && $1 ~ /^[0-9]/ { all = $1 }
+        END { print all - idle / hertz, (user - own) / hertz, all }'
 }
 # Until the machine does next to nothing, for a minute at most: others may be building.
 wait_for_calm() {
@@ -107,32 +116,32 @@ measure() { # COMMAND... : sets out, busy (seconds of processor 1), others (shar
     before=$(ticks)
     out=$("$@") || die "$* failed"
     after=$(ticks)
-    read -r busy others share < <(awk -v before="$before" -v after="$after" -v hertz="$(getconf CLK_TCK)" 'BEGIN {
+    read -r busy others share < <(awk -v before="$before" -v after="$after" 'BEGIN {
         split(before, b); split(after, a)
-        print (a[1] - b[1]) / hertz, (a[2] - b[2]) / (a[3] - b[3]), (a[1] - b[1]) / (a[3] - b[3]) }')
+        print a[1] - b[1], (a[2] - b[2]) / (a[3] - b[3]), (a[1] - b[1]) / (a[3] - b[3]) }')
     quiet=$(awk "BEGIN { print ($others < ${TRAFFIC_OTHERS:-0.05}) }")
 }
 median() { sort -g | awk '{ at[NR] = $1 } END { print NR % 2 ? at[(NR + 1) / 2] : (at[NR / 2] + at[NR / 2 + 1]) / 2 }'; }
 sent_by_a1() { cat /proc/net/dev | awk '$1 == "v-a1:" { print $3 }'; }
 
-# Rounds one way and the other until enough pairs were quiet. One line of each pair: rate, cost and share of processor 1
-# plain, then redirected.
-rounds() { # FUNCTION THAT SETS rate AND cost, GIVEN plain OR redirected
-    local good=0 attempts=0 pair way calm
+# Rounds one way after the other until enough were quiet. One line of each round: rate, cost and share of processor 1,
+# of each way in turn.
+rounds() { # FUNCTION THAT SETS rate AND cost, GIVEN A WAY; WAYS, plain AND redirected FIRST
+    local good=0 attempts=0 line way calm
     : >"$LAB/$1.rounds"
     while [ $good -lt "$TRAFFIC_ROUNDS" ]; do
-        attempts=$((attempts + 1)) pair='' calm=1
-        for way in plain redirected; do
-            "$1" $way
-            pair+="$rate $cost $share "
+        attempts=$((attempts + 1)) line='' calm=1
+        for way in "${@:2}"; do
+            "$1" "$way"
+            line+="$rate $cost $share "
             [ "$quiet" = 1 ] || calm=0
         done
-        [ -z "${TRAFFIC_VERBOSE-}" ] || echo "    $1: $pair others $others"
+        [ -z "${TRAFFIC_VERBOSE-}" ] || echo "    $1: $line others $others"
         if [ $calm = 0 ]; then
             [ $attempts -lt $((10 * TRAFFIC_ROUNDS)) ] || die "$1: the machine is too busy"
             continue
         fi
-        echo "$pair" >>"$LAB/$1.rounds"
+        echo "$line" >>"$LAB/$1.rounds"
         good=$((good + 1))
     done
     [ $attempts = $good ] || echo "($((attempts - good)) rounds were disturbed and measured again)"
@@ -150,21 +159,26 @@ missed=0
 
 # ---- the parts
 
-tcp() { # plain|redirected
-    local to=(10.0.0.101 3129)
-    [ "$1" = plain ] || to=(10.2.0.2 80)
-    measure on 0 c1 "$load" source "${to[@]}" "$TRAFFIC_SECONDS" 0
+tcp() { # plain|redirected|socket
+    local -A to=([plain]='10.0.0.50 8000' [redirected]='10.2.0.2 80' [socket]='10.0.0.101 3129')
+    # shellcheck disable=SC2086
+    measure on 0 c1 "$load" source ${to[$1]} "$TRAFFIC_SECONDS" 0
     rate=$(jq '.bytes / .seconds / 1e6' <<<"$out")
     cost=$(jq ".bytes as \$bytes | $busy * 1e9 / \$bytes" <<<"$out") # milliseconds for a megabyte
 }
 part_tcp() {
     tcp redirected # ARP, caches
-    rounds tcp
-    printf '%-24s %10s %16s %22s\n' 'TCP to the proxy' 'MB/s' 'cpu 1, ms/MB' 'cpu 1, share of time'
-    printf '%-24s %10.0f %16.3f %22.2f\n' plain "$(of_rounds tcp '$1')" "$(of_rounds tcp '$2')" "$(of_rounds tcp '$3')" \
-        redirected "$(of_rounds tcp '$4')" "$(of_rounds tcp '$5')" "$(of_rounds tcp '$6')"
-    figure 'throughput, redirected to plain' "$(of_rounds tcp '$4 / $1')" '>= 0.9'
-    figure 'processor time for a megabyte, redirected to plain' "$(of_rounds tcp '$5 / $2')" '<= 1.3'
+    tcp plain
+    rounds tcp plain redirected socket
+    printf '%-24s %10s %16s %22s\n' 'TCP' 'MB/s' 'cpu 1, ms/MB' 'cpu 1, share of time'
+    printf '%-24s %10.0f %16.3f %22.2f\n' \
+        'plain, forwarded' "$(of_rounds tcp '$1')" "$(of_rounds tcp '$2')" "$(of_rounds tcp '$3')" \
+        'redirected, to the proxy' "$(of_rounds tcp '$4')" "$(of_rounds tcp '$5')" "$(of_rounds tcp '$6')" \
+        'plain, to a socket' "$(of_rounds tcp '$7')" "$(of_rounds tcp '$8')" "$(of_rounds tcp '$9')"
+    figure 'throughput, redirected to forwarded' "$(of_rounds tcp '$4 / $1')" '>= 0.9'
+    figure 'processor time for a megabyte, redirected to forwarded' "$(of_rounds tcp '$5 / $2')" '<= 1.3'
+    printf '%-64s %10s\n' 'throughput, redirected to a socket of the appliance' "$(of_rounds tcp '$4 / $7')" \
+        'processor time for a megabyte, redirected to a socket' "$(of_rounds tcp '$5 / $8')"
 }
 
 send_small() { # plain|gre FLOWS RATE SECONDS: sets sent and delivered
@@ -188,7 +202,7 @@ part_packets() {
     steer - v-a1 here
     printf '%-24s %10s %16s %22s\n' '64-byte packets' '1000/s' 'cpu 1, us each' 'cpu 1, share of time'
     for flows in 1 4096; do
-        rounds small
+        rounds small plain redirected
         printf '%-24s %10.0f %16.2f %22.2f\n' "plain, $flows flows" "$(of_rounds small '$1')" "$(of_rounds small '$2')" \
             "$(of_rounds small '$3')" "redirected, $flows flows" "$(of_rounds small '$4')" "$(of_rounds small '$5')" \
             "$(of_rounds small '$6')"
