@@ -43,6 +43,13 @@ enum : uint32_t {
     bn_qf_include_self = 0x2000,
     bn_qf_leaves_only = 0x4000,
 };
+// Commit flags of a set request. Beside them it may carry the purpose of the commit as its text, and as its
+// number the revision that it was made for: it is refused when there is another one. 0 is any.
+enum : uint32_t {
+    bn_cf_check_only = 0x1, // say what would become of it, and change nothing
+    bn_cf_ends_wait = 0x2,  // also while another commit waits to be confirmed, which that ends
+};
+constexpr uint32_t bn_cf_minutes_shift = 16; // from here up: minutes to confirm it in, or it is undone
 constexpr uint16_t BN_PROTO = 2;
 constexpr uint32_t BN_FRAME_HEADER_BYTES = 32;
 // The words of the LC_NO_BUFFER_SPACE that a query gets whose answer is larger than a frame.

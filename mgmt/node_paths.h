@@ -36,6 +36,10 @@
 #define NODE_ROLES NODE_ALARM_STATE "/role"           // by group
 #define NODE_LEFT_GROUPS NODE_ALARM_STATE "/left"     // out of their routers for a time, by group
 
+#define NODE_CONFIG_STATE "/mgmtd/config/state"
+#define NODE_CONFIG_TEXT NODE_CONFIG_STATE "/text"  // the configuration as its file has it
+#define NODE_COMMITS NODE_CONFIG_STATE "/commit"    // the commits that are kept, by number
+
 // --- Events
 #define EVENT_CONFIG_CHANGE "/mgmtd/notify/dbchange" // after each commit
 #define EVENT_RAISE_ALARM "/qv/alarms/events/raise_alarm"
@@ -56,6 +60,7 @@
 // --- Actions that mgmtd carries out
 #define ACTION_ADD_INTEREST "/mgmtd/events/actions/interest/add"
 #define ACTION_REMOVE_INTEREST "/mgmtd/events/actions/interest/remove"
+#define ACTION_CONFIRM "/mgmtd/config/actions/confirm"
 
 // --- Alarm types
 #define ALARM_TYPE_ADJACENCY 196638  // no router reports this appliance

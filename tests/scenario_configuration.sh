@@ -193,4 +193,66 @@ case_start() {
     finish a1
 }
 
+# mgmtd is killed while three clients commit: what was acknowledged is there again, in the file and in the history, and
+# nothing is left half written. WCCP_KILLS is how often.
+case_killed() {
+    lab_appliance a1 10.0.0.101
+    # shellcheck disable=SC2016
+    lab_in a1 bash -c '
+        bin=$1 dir=/etc/opt/rvl/kept node=/qv/wccpd/wccp/srv_grp/config cut=0 mgmtd=
+        fail() { echo "kill $kill: $*"; cat $dir/out; exit 1; }
+        ctl() { "$bin/mgmtctl" --timeout 20 "$@" 2>/dev/null; }
+        start() {
+            "$bin/mgmtd" --config $dir/conf >>$dir/out 2>&1 & mgmtd=$!
+            until ctl get /qv/tunneld/system/config/mode >/dev/null; do kill -0 $mgmtd || fail "does not start"; sleep 0.01; done
+        }
+        change() { local n=$2; while ctl set $node/$1/weight=$n; do echo $n >$dir/acknowledged-$1; n=$((n + 1)); done; }
+        mkdir $dir; start; ctl set $node/{1,2,3}/weight=0 >/dev/null
+        for kill in $(seq "$2"); do
+            at=()
+            for id in 1 2 3; do
+                at[id]=$(ctl get $node/$id/weight)
+                last=$(cat $dir/acknowledged-$id 2>/dev/null || echo 0)
+                [ "${at[id]}" = "$last" ] || [ "${at[id]}" = $((last + 1)) ] || fail "$last was acknowledged, there is ${at[id]}"
+                echo "${at[id]}" >$dir/acknowledged-$id
+                change $id $((at[id] + 1)) &
+                clients[id]=$!
+            done
+            sleep "0.$(printf %03d $((RANDOM % 150 + 10)))"
+            kill -KILL $mgmtd; wait $mgmtd "${clients[@]}"
+            [ -z "$(find $dir -name "*unfinished" -o -name pending)" ] || cut=$((cut + 1))
+            "$bin/mgmtd" --config $dir/conf --check || fail "the file is broken"
+            start
+            [ -z "$(find $dir -name "*unfinished" -o -name pending)" ] || fail "something is left over"
+            last=$(ctl history --json | jq -r "if length <= 50 then .[0].commit else 0 end")
+            [ -z "$(ctl diff "$last" || echo failed)" ] || fail "commit $last is not the configuration"
+        done 2>/dev/null
+        ! grep "can.t be" $dir/out || fail "an entry is broken"
+        echo "$kill kills, $cut of them in a commit, $(ctl history --json | jq ".[0].commit") commits"
+        kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" "${WCCP_KILLS:-60}" || die "a kill is not survived"
+}
+
+# A disk that is full, or that the history can't be written to, refuses the commit; what was there stays.
+case_full() {
+    lab_appliance a1 10.0.0.101
+    # shellcheck disable=SC2016
+    lab_in a1 bash -c '
+        bin=$1 dir=/etc/opt/rvl/small node=/qv/wccpd/wccp/srv_grp/config
+        fail() { echo "$*"; cat /etc/opt/rvl/out; exit 1; }
+        ctl() { "$bin/mgmtctl" "$@"; }
+        start() { "$bin/mgmtd" --config $dir/conf >>/etc/opt/rvl/out 2>&1 & mgmtd=$!; until ctl get /qv/tunneld/system/config/mode >/dev/null 2>&1; do sleep 0.01; done; }
+        mkdir $dir; mount -t tmpfs -o size=160k tmpfs $dir; start
+        for n in $(seq 200); do
+            ctl set $node/{$n,$((n + 50))}/assign_detail=$(printf %0200d $n) >/dev/null 2>$dir/../said || break
+        done
+        [ "$n" -gt 5 ] && [ "$n" -lt 200 ] && grep -q "could not be saved: .*No space left on device" $dir/../said || fail "commit $n: $(<$dir/../said)"
+        before=$(ctl export) last=$(ctl history --json | jq ".[0].commit")
+        [[ $before = *"config/$((n - 1))]"* && $before != *"config/$n]"* ]] && [ -z "$(ctl diff "$last")" ] || fail "not as before"
+        ctl confirm >/dev/null 2>&1; kill -KILL $mgmtd; wait $mgmtd 2>/dev/null; start
+        [ "$(ctl export)" = "$before" ] && [ "$(ctl history --json | jq ".[0].commit")" = "$last" ] || fail "something is lost"
+        mount -o remount,size=1m $dir && ctl set $node/$n/assign_detail=x >/dev/null || fail "no commit after there is room again"
+        ctl rollback "$last" >/dev/null && [ "$(ctl export)" = "$before" ] || fail "no rollback"
+        kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" || die "a full disk is not survived"
+}
+
 lab_case

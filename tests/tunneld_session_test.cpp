@@ -221,7 +221,7 @@ struct Session : Loop {
     }
     void set(const std::string &name, const std::string &text) {
         const commit_result result =
-            server_commit(daemon.get(), {{set_kind::create, name, bn_type_str, text}}, "test");
+            server_commit(daemon.get(), {{set_kind::create, name, bn_type_str, text}}, {"test"});
         EXPECT_EQ(result.code, 0u) << result.message;
     }
 };

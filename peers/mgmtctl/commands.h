@@ -14,6 +14,7 @@ enum ctl_exit : int {
     CTL_UNREACHABLE = 3, // no mgmtd, no answer, or the session was lost
     CTL_NOT_FOUND = 4,   // no such node or group
     CTL_PARTLY = 5,      // no longer given: every command is one commit
+    CTL_WOULD_CHANGE = 1, // apply --check: there is a difference; every failure is 2
     CTL_STANDING = 6,    // alarms --check: an alarm is active
     CTL_OUTPUT = 7,      // standard output took not all of it
 };
@@ -25,6 +26,7 @@ struct ctl_options {
     int colour = -1;      // 1 yes, 0 no, -1 when standard output is a terminal
     int below = 0;        // rows at the top of the terminal that are somebody else's
     int64_t timeout_ms = 10'000;
+    std::string cause; // of commits, in the history: the word of the command line, with the one after it
 };
 
 // One function for each word of the command line. The result is the exit code; what there is to say has been
@@ -49,6 +51,23 @@ int ctl_policy(const ctl_options &options, const std::vector<std::string> &words
 int ctl_intercept(const ctl_options &options, const std::vector<std::string> &words);
 int ctl_bypass(const ctl_options &options, const std::vector<std::string> &words);
 int ctl_tunnel(const ctl_options &options, const std::vector<std::string> &words);
+
+// The configuration as a whole (config_cli.cpp).
+struct ctl_apply_options {
+    bool check = false;           // only say whether it would change anything
+    bool yes = false;             // don't ask
+    bool merge = false;           // what the file doesn't name stays
+    uint32_t confirm_minutes = 0; // in which "mgmtctl confirm" has to follow; 0: it stays
+};
+constexpr uint32_t CTL_CONFIRM_MAX_MINUTES = 7 * 24 * 60;
+// `file`: mgmtd's format or JSON; "-" is standard input.
+int ctl_apply(const ctl_options &options, const std::string &file, const ctl_apply_options &how);
+int ctl_confirm(const ctl_options &options);
+int ctl_export(const ctl_options &options);
+int ctl_history(const ctl_options &options);
+// Numbers of commits; 0 for one that wasn't given.
+int ctl_diff(const ctl_options &options, uint32_t from, uint32_t to);
+int ctl_rollback(const ctl_options &options, uint32_t number);
 
 // The whole appliance (show.cpp).
 int ctl_show(const ctl_options &options);

@@ -10,6 +10,7 @@
 #include "peers/mgmtctl/group_words.h"
 #include "peers/mgmtctl/groups.h"
 #include "peers/mgmtctl/render.h"
+#include "peers/nodes/secrets.h"
 
 static constexpr size_t SECRET_MAX = 256; // more than any password has; mgmtd says what is too long
 
@@ -100,8 +101,8 @@ static void tell_list(const ctl_options &options, const std::vector<listed_group
             const group_word *word = find_group_word(name);
             const bool hidden = name == "password" && !options.secrets;
             line += std::string(" ") + (word ? word->word : name.c_str()) + " " +
-                    (hidden ? "********" : shell_quoted(value));
-            one[word ? word->word : name] = hidden ? "********" : value;
+                    (hidden ? HIDDEN : shell_quoted(value));
+            one[word ? word->word : name] = hidden ? HIDDEN : value;
         }
         if (!options.json)
             put(line + "\n");

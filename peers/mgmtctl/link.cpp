@@ -26,8 +26,10 @@ ctl_link link_to_mgmtd(const ctl_options &options) {
     link.query = [held](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
         return held->open(out_reason) && ctl_query(held->session, walk, name, out, out_reason);
     };
-    link.set = [held](const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *out_reason) {
-        return held->open(out_reason) && ctl_set(held->session, items, out, out_reason);
+    const ctl_order order = {options.cause};
+    link.set = [held, order](const std::vector<ctl_change_item> &items, ctl_reply *out,
+                             std::string *out_reason) {
+        return held->open(out_reason) && ctl_set(held->session, items, order, out, out_reason);
     };
     return link;
 }

@@ -106,6 +106,8 @@ struct command_line {
     std::string name = "/";
     bool children = false, leaves = false, existing = false, check = false;
     uint64_t count = 0;
+    ctl_apply_options apply;
+    uint32_t from = 0, to = 0; // commits
 };
 } // namespace
 
@@ -183,6 +185,43 @@ static void add_traffic_commands(command_line *line) {
     })->add_option("WORD", line->words);
 }
 
+static void add_config_commands(command_line *line) {
+    const CLI::Range commits(1u, UINT32_MAX);
+    CLI::App *apply = add_command(line, "apply", "make FILE the configuration: one commit",
+                                  [line] { return ctl_apply(line->options, line->name, line->apply); });
+    apply->add_option("FILE", line->name, "a configuration, as mgmtd's file has it or as JSON; - for standard input")
+        ->required();
+    CLI::Option *check = apply->add_flag("--check", line->apply.check,
+                                         "change nothing; exit with 1 when it would, 0 when not, 2 for errors");
+    apply->add_flag("--yes", line->apply.yes, "don't ask");
+    apply->add_flag("--merge", line->apply.merge, "what FILE doesn't name stays as it is");
+    apply->add_option("--confirm", line->apply.confirm_minutes,
+                      "undo it after so many minutes, unless \"mgmtctl confirm\" follows")
+        ->check(CLI::Range(1u, CTL_CONFIRM_MAX_MINUTES))
+        ->excludes(check);
+    add_command(line, "confirm", "keep what was applied with --confirm",
+                [line] { return ctl_confirm(line->options); });
+    add_command(line, "export", "the configuration as apply reads it",
+                [line] { return ctl_export(line->options); });
+    add_command(line, "history", "the last commits", [line] { return ctl_history(line->options); });
+    CLI::App *diff = add_command(line, "diff", "what the last commit changed, or all since commit FROM",
+                                 [line] { return ctl_diff(line->options, line->from, line->to); });
+    diff->add_option("FROM", line->from, "the number of a commit")->check(commits);
+    diff->add_option("TO", line->to, "the number of another, instead of the configuration as it is")->check(commits);
+    add_command(line, "rollback", "go back to a commit: a commit of its own", [line] {
+        return ctl_rollback(line->options, line->from);
+    })->add_option("COMMIT", line->from, "its number")->check(commits)->required();
+}
+
+// Of a command whose words begin with what to do, with that.
+static std::string cause_of(const command_line &line) {
+    const std::string word = line.app.get_subcommands().front()->get_name();
+    for (const char *begins : {"group", "policy", "intercept", "bypass", "tunnel"})
+        if (word == begins && !line.words.empty())
+            return word + " " + line.words.front();
+    return word;
+}
+
 static void add_show_command(command_line *line) {
     ctl_options *options = &line->options;
     CLI::App *command = add_command(line, "show", "the whole appliance in one screen",
@@ -217,6 +256,7 @@ int main(int argc, char **argv) {
     add_watch_commands(&line);
     add_group_commands(&line);
     add_traffic_commands(&line);
+    add_config_commands(&line);
     add_show_command(&line);
     add_shell_command(&line);
 
@@ -234,5 +274,6 @@ int main(int argc, char **argv) {
         unshield(&word);
     unshield(&line.name);
     line.options.timeout_ms = static_cast<int64_t>(std::max(1.0, line.seconds * 1000)); // 1 also for "nan"
+    line.options.cause = cause_of(line);
     return finish(line.run());
 }

@@ -1,41 +1,13 @@
 // The words of mgmtctl that name nodes: "get", "walk", "set", "delete", "alarms", and the shell's completion.
 #include <cstdio>
-#include <memory>
 
 #include <nlohmann/json.hpp>
 
 #include "mgmt/node_paths.h"
-#include "peers/mgmtctl/commands.h"
+#include "peers/mgmtctl/connection.h"
 #include "peers/mgmtctl/nodes.h"
 #include "peers/mgmtctl/render.h"
 #include "runtime/common.h"
-
-namespace {
-struct closer {
-    void operator()(ctl_session *session) const { ctl_close(session); }
-};
-// A session, or the exit code of its failure, which has been printed.
-struct connection {
-    const ctl_options &options;
-    std::unique_ptr<ctl_session, closer> session;
-    std::string reason;
-    int code = CTL_OK;
-
-    explicit connection(const ctl_options &wanted) : options(wanted) {
-        session.reset(ctl_open(options.timeout_ms, &reason));
-        if (!session)
-            code = lost();
-    }
-    int lost() const { return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0}); }
-    bool ask(ctl_walk walk, const std::string &name, ctl_reply *out) {
-        return ctl_query(session.get(), walk, name, out, &reason);
-    }
-    ctl_ask asking() {
-        return
-            [this](ctl_walk walk, const std::string &name, ctl_reply *out) { return ask(walk, name, out); };
-    }
-};
-} // namespace
 
 // --- get and walk
 
@@ -137,7 +109,7 @@ static int change(const ctl_options &options, const std::vector<ctl_change_item>
     groups_before before;
     ctl_reply reply;
     if (!look_before(mgmtd.asking(), items, &before) ||
-        !ctl_set(mgmtd.session.get(), items, &reply, &mgmtd.reason))
+        !ctl_set(mgmtd.session.get(), items, {options.cause}, &reply, &mgmtd.reason))
         return mgmtd.lost();
     if (reply.code != 0)
         return refused_change(options, &mgmtd, reply, items);
@@ -192,7 +164,7 @@ int ctl_alarms(const ctl_options &options, bool check) {
 // Says nothing but what fits, whatever is wrong: it is asked while somebody types.
 int ctl_complete(const std::string &word) {
     std::string reason;
-    const std::unique_ptr<ctl_session, closer> session(ctl_open(1000, &reason));
+    const ctl_held_session session(ctl_open(1000, &reason));
     const ctl_ask ask = [&](ctl_walk walk, const std::string &name, ctl_reply *out) {
         return session && ctl_query(session.get(), walk, name, out, &reason);
     };

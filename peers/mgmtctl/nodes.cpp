@@ -339,6 +339,6 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
     for (const auto &[root, words] : whole)
         if (!ended.contains(root))
             out.notes.push_back("group " + number_of(root) + ": wccpd takes a change of " + joined(words) +
-                                " only with the group as a whole, which was deleted and created again");
+                                " only with the group as a whole, which is deleted and created again for it");
     return out;
 }

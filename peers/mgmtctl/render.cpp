@@ -16,6 +16,7 @@
 #include "mgmt/node_paths.h"
 #include "peers/nodes/binding_text.h"
 #include "peers/nodes/schema.h"
+#include "peers/nodes/secrets.h"
 #include "runtime/common.h"
 
 // Values come from others: on a terminal they write, and do nothing else.
@@ -38,25 +39,8 @@ std::string json_line(const ctl_json &value) {
 
 // --- Nodes
 
-static const char *const STARS = "********";
-
 std::string shown_value(const ctl_binding &binding, bool secrets) {
-    if (secrets || binding.value.empty())
-        return binding.value;
-    if (binding.name.ends_with("/password"))
-        return STARS;
-    // The dumps of groups have it in a line of theirs.
-    std::string text = binding.value;
-    if (!binding.name.ends_with("/debug") && !binding.name.ends_with("/debug_all"))
-        return text;
-    static const std::string label = "WCCP password";
-    for (size_t at = text.find(label); at != std::string::npos; at = text.find(label, at + 1)) {
-        const size_t end = std::min(text.find('\n', at), text.size());
-        const size_t colon = text.find(": ", at);
-        if (colon < end)
-            text.replace(colon + 2, end - colon - 2, STARS);
-    }
-    return text;
+    return secrets ? binding.value : hidden_value(binding.name, binding.value);
 }
 
 ctl_json json_value(const ctl_binding &binding) {

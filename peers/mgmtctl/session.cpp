@@ -166,7 +166,7 @@ static lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) 
     self->awaited = 0;
     self->answered = true;
     self->reply = {msg->return_code, msg->return_message ? ts_str(msg->return_message) : "",
-                   as_text(fields_of(msg))};
+                   as_text(fields_of(msg)), msg->db_revision_id};
     return LC_OK;
 }
 
@@ -295,12 +295,24 @@ static bn_binding *make_value(const ctl_binding &from) {
     return make_binding(from.name, {type, from.value});
 }
 
-bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, ctl_reply *out,
-             std::string *out_reason) {
+// Who became root for this, as sudo leaves it; mgmtd knows only that it was root.
+static lc_status add_person(bn_request_msg *msg) {
+    const char *person = geteuid() == 0 ? getenv("SUDO_USER") : nullptr;
+    return person && *person ? ts_new_str(&msg->audit_user, person) : LC_OK;
+}
+
+bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, const ctl_order &order,
+             ctl_reply *out, std::string *out_reason) {
     static constexpr uint32_t subops[] = {bn_set_create, bn_set_modify, bn_set_delete, bn_set_reset};
     owned_request msg;
-    if (bn_set_request_msg_create(&msg.pointer, 0) != LC_OK)
+    const uint32_t flags = (order.check_only ? bn_cf_check_only : 0u) | (order.ends_wait ? bn_cf_ends_wait : 0u) |
+                           order.confirm_minutes << bn_cf_minutes_shift;
+    if (bn_set_request_msg_create(&msg.pointer, flags) != LC_OK || add_person(msg.pointer) != LC_OK)
         return no_memory(out_reason);
+    (void)ts_free(&msg.pointer->text);
+    if (ts_new_str(&msg.pointer->text, order.cause.c_str()) != LC_OK)
+        return no_memory(out_reason);
+    msg.pointer->number = order.revision;
     for (const ctl_change_item &item : items) {
         owned_binding binding(make_value(item.binding));
         if (!binding.pointer ||
@@ -323,6 +335,10 @@ static bool send_action(ctl_session *session, const std::string &name,
             return no_memory(out_reason);
     }
     return send_request(session, msg.pointer, out, out_reason);
+}
+
+bool ctl_action(ctl_session *session, const std::string &name, ctl_reply *out, std::string *out_reason) {
+    return send_action(session, name, {}, out, out_reason);
 }
 
 bool ctl_add_interest(ctl_session *session, const std::string &event,

@@ -19,6 +19,7 @@ struct ctl_reply {
     uint32_t code = 0;
     std::string message;
     std::vector<ctl_binding> bindings;
+    uint32_t revision = 0; // of the configuration, in answers to queries and changes
 };
 
 struct ctl_event {
@@ -47,9 +48,18 @@ void ctl_close(ctl_session *session);
 // False, with the reason, when no answer came: the session is of no use then.
 bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out,
                std::string *out_reason);
-// One commit.
-bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, ctl_reply *out,
-             std::string *out_reason);
+// How a commit is made.
+struct ctl_order {
+    std::string cause;            // what it is for, in the history
+    bool check_only = false;      // whether it would be taken, without making it
+    bool ends_wait = false;       // of another one that waits to be confirmed
+    uint32_t revision = 0;        // refused when the configuration has another one; 0: any
+    uint32_t confirm_minutes = 0; // in which it has to be confirmed; 0: it stays
+};
+bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, const ctl_order &order,
+             ctl_reply *out, std::string *out_reason);
+// An action of mgmtd's without bindings.
+bool ctl_action(ctl_session *session, const std::string &name, ctl_reply *out, std::string *out_reason);
 // Asks for an event, only with a binding that matches one of the patterns when there are any.
 bool ctl_add_interest(ctl_session *session, const std::string &event,
                       const std::vector<std::string> &patterns, std::string *out_reason);

@@ -3,7 +3,7 @@
 
 #include <vector>
 
-#include "peers/mgmtd/node_tree.h"
+#include "peers/nodes/node_tree.h"
 
 using change_list = std::vector<node_change>;
 

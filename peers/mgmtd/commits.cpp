@@ -111,10 +111,11 @@ static void write_facility(const server *self) {
 
 // --- Commits
 
-static void take_over(server *self, node_tree next, const commit_result &commit) {
+void server_take_over(server *self, node_tree next, const commit_result &commit) {
     const node_tree before = std::exchange(self->tree, std::move(next));
     if (facility_of(before) != facility_of(self->tree))
         write_facility(self);
+    server_show_commits(self);
     send_change_events(self, before, commit);
     server_forget_deleted_groups(self);
     self->expire_at_ms = 0;
@@ -128,29 +129,53 @@ static bool may_commit(const server *self, const node_tree &next, std::string *o
     return bad.empty() && tree_check_change(self->tree, next, out_reason);
 }
 
-static commit_result prepare_commit(server *self, const std::vector<set_step> &steps, node_tree *out_next) {
+static commit_result refused(uint32_t code, const std::string &reason) {
+    return {code, reason, {}, {}};
+}
+
+static commit_result prepare_commit(server *self, const std::vector<set_step> &steps,
+                                    const commit_order &order, node_tree *out_next) {
+    if (order.revision && order.revision != self->tree.revision)
+        return refused(LC_ASSERTION, "The configuration has been changed since (commit " +
+                                         std::to_string(self->tree.revision) + "): look again");
     commit_result result = tree_prepare(self->tree, steps, out_next);
     std::string reason;
-    if (result.code == 0 && !may_commit(self, *out_next, &reason))
-        return {LC_ASSERTION, reason, {}, {}};
-    if (result.code == 0 && out_next->set == self->tree.set && result.renewed.empty())
+    if (result.code != 0)
+        return result;
+    if (!may_commit(self, *out_next, &reason))
+        return refused(LC_ASSERTION, reason);
+    if (out_next->set == self->tree.set && result.renewed.empty()) {
         out_next->revision = self->tree.revision;
-    else if (result.code == 0 && !self->file.path.empty() &&
-             !config_save(&self->file, *out_next, self->comments, &reason))
-        return {LC_IO_ERROR, "The configuration could not be saved: " + reason, {}, {}};
+        return result;
+    }
+    if (reason = server_wait_for_confirmation(self); !reason.empty() && !order.ends_wait)
+        return refused(LC_ASSERTION, reason);
+    const commit_extent extent = {result.changes.size(),
+                                  result.changes.empty() ? result.renewed.data() : &result.changes[0].name};
+    if (!order.check_only && !server_save(self, *out_next, self->comments, order, extent, &reason))
+        return refused(LC_IO_ERROR, "The configuration could not be saved: " + reason);
     return result;
 }
 
-commit_result server_commit(server *self, const std::vector<set_step> &steps, const std::string &who) {
+static std::string count_text(size_t changes) {
+    return std::to_string(changes) + (changes == 1 ? " node" : " nodes");
+}
+
+commit_result server_commit(server *self, const std::vector<set_step> &steps, const commit_order &order) {
     node_tree next;
-    commit_result result = prepare_commit(self, steps, &next);
-    if (result.code != 0) {
-        self->say("commit of " + who + " refused: " + result.message);
+    commit_result result = prepare_commit(self, steps, order, &next);
+    if (order.check_only) {
+        if (result.code == 0)
+            result.message = count_text(result.changes.size()) + " would change";
         return result;
     }
-    self->say("commit " + std::to_string(next.revision) + " of " + who + ": " +
+    if (result.code != 0) {
+        self->say("commit of " + order.who + " refused: " + result.message);
+        return result;
+    }
+    self->say("commit " + std::to_string(next.revision) + " of " + order.who + ": " +
               std::to_string(result.changes.size()) + " nodes changed");
-    take_over(self, std::move(next), result);
+    server_take_over(self, std::move(next), result);
     return result;
 }
 
@@ -177,7 +202,9 @@ int64_t server_expire_bypasses(server *self) {
         else if (until != 0)
             wait_ms = std::min(wait_ms < 0 ? CLOCK_LOOK_MS : wait_ms, (until - clock) * 1000);
     }
-    if (!over.empty() && server_commit(self, over, "mgmtd (bypasses whose time is over)").code != 0)
+    if (!over.empty() &&
+        server_commit(self, over, {"mgmtd (bypasses whose time is over)", "mgmtd", "bypasses whose time is over"})
+                .code != 0)
         wait_ms = CLOCK_LOOK_MS; // refused, as when the file cannot be written
     return self->expire_at_ms = wait_ms < 0 ? -1 : now + wait_ms;
 }
@@ -207,6 +234,7 @@ void server_begin(server *self) {
     if (const std::string open = config_protect(self->file.path); !open.empty())
         self->say(open);
     write_facility(self);
+    server_open_history(self);
 }
 
 static bool read_again(server *self, config_text *out, std::string *out_warnings) {
@@ -230,20 +258,37 @@ static bool read_again(server *self, config_text *out, std::string *out_warnings
     return true;
 }
 
+// What was read is one commit, of a file that is written already. False with the reason.
+static bool keep_reload(server *self, const config_text &read, const std::vector<node_change> &changes,
+                        std::string *out_reason) {
+    if (changes.empty())
+        return true;
+    if (*out_reason = server_wait_for_confirmation(self); !out_reason->empty())
+        return false;
+    return server_keep(self, read.tree, read.comments, {"", "", "the configuration file was read again"},
+                       {changes.size(), &changes[0].name}, out_reason);
+}
+
 void server_reload(server *self) {
     config_text text;
-    std::string warnings;
+    std::string warnings, reason;
+    const config_file before = self->file;
     if (!read_again(self, &text, &warnings)) {
         self->say("configuration not read again:\n" + text.errors);
         return;
     }
     const commit_result commit = {0, "", tree_difference(self->tree.nodes, text.tree.nodes), {}};
     text.tree.revision = self->tree.revision + (commit.changes.empty() ? 0 : 1);
+    if (!keep_reload(self, text, commit.changes, &reason)) {
+        self->file = before;
+        self->say("configuration not read again: " + reason);
+        return;
+    }
     self->comments = std::move(text.comments);
     self->say("configuration read again: " + std::to_string(commit.changes.size()) + " nodes changed");
     if (const std::string open = config_protect(self->file.path); !open.empty())
         self->say(open);
     if (!warnings.empty())
         self->say(warnings);
-    take_over(self, std::move(text.tree), commit);
+    server_take_over(self, std::move(text.tree), commit);
 }

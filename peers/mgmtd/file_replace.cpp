@@ -115,6 +115,13 @@ static void sync_directory(const std::string &file) {
         (void)fsync(directory.fd);
 }
 
+bool rename_file(const std::string &from, const std::string &to) {
+    if (rename(from.c_str(), to.c_str()) != 0)
+        return false;
+    sync_directory(to);
+    return true;
+}
+
 bool replace_file(const std::string &path, const std::string &content, mode_t mode, const accept_file &accept,
                   std::string *out_reason) {
     std::string target, written;
@@ -128,10 +135,9 @@ bool replace_file(const std::string &path, const std::string &content, mode_t mo
         return failed(out_reason);
     if (accept && !accept(written, out_reason))
         return false;
-    if (rename(fresh.path.c_str(), target.c_str()) != 0)
+    if (!rename_file(fresh.path, target))
         return failed(out_reason);
     fresh.renamed = true;
-    sync_directory(target);
     return true;
 }
 

@@ -18,5 +18,7 @@ using accept_file = std::function<bool(const std::string &written, std::string *
 // A path that is a link stays one: its target is replaced, or created.
 bool replace_file(const std::string &path, const std::string &content, mode_t mode, const accept_file &accept,
                   std::string *out_reason);
+// Renames a file within its directory, and syncs that. False with errno.
+bool rename_file(const std::string &from, const std::string &to);
 // Removes what a replacement that was killed has left. True when there was something.
 bool remove_unfinished_file(const std::string &path);

@@ -7,7 +7,7 @@
 
 #include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
-#include "peers/mgmtd/node_tree.h"
+#include "peers/nodes/node_tree.h"
 #include "peers/nodes/binding_text.h"
 
 // An event; the fields are bindings in their order.

@@ -128,24 +128,32 @@ static void refuse_query(server *self, const pending_query &query, uint32_t code
 // What mgmtd answers itself. False when that is more than a message holds: the query has been refused.
 static bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
     size_t bytes = query.gathered_bytes;
-    const auto asker = self->peers.find(query.asker);
-    const bool runs_groups = asker != self->peers.end() && server_runs_groups(asker->second);
+    const auto found_asker = self->peers.find(query.asker);
+    const peer asker = found_asker == self->peers.end() ? peer{} : found_asker->second;
+    const auto append = [&](uint32_t id, const node_name &name, const node_value &value) {
+        const std::string text = name.text();
+        bytes += text.size() + value.text.size() + ANSWER_NODE_BYTES;
+        if (bytes > GCL_FRAME_MAX)
+            refuse_query(self, query, LC_NO_BUFFER_SPACE, BN_TOO_LARGE);
+        else
+            (void)append_answer(response, id, text, value);
+        return bytes <= GCL_FRAME_MAX;
+    };
     for (const asked_node &asked : query.asked) {
         node_name name;
         node_list found;
-        if (parse_node_name(asked.name, &name))
-            answer_here(self, asked.subop, asked.flags, name, &found);
-        for (const auto *entry : found) {
-            const std::string text = entry->first.text();
-            bytes += text.size() + entry->second.text.size() + ANSWER_NODE_BYTES;
-            if (bytes > GCL_FRAME_MAX) {
-                refuse_query(self, query, LC_NO_BUFFER_SPACE, BN_TOO_LARGE);
+        if (!parse_node_name(asked.name, &name))
+            continue;
+        answer_here(self, asked.subop, asked.flags, name, &found);
+        for (const auto *entry : found)
+            if (!append(asked.id, entry->first, server_runs_groups(asker)
+                                                    ? server_value_for_wccpd(self, entry->first, entry->second)
+                                                    : entry->second))
                 return false;
-            }
-            (void)append_answer(response, asked.id, text,
-                                runs_groups ? server_value_for_wccpd(self, entry->first, entry->second)
-                                            : entry->second);
-        }
+        node_value made;
+        if (asked.subop == bn_query_get && server_config_text(self, name, &made) &&
+            !append(asked.id, name, made))
+            return false;
     }
     return true;
 }

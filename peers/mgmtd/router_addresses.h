@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "peers/mgmtd/node_tree.h"
+#include "peers/nodes/node_tree.h"
 
 // An IPv4 address of this machine and the broadcast address of its network, in host order.
 struct local_address {

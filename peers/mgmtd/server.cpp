@@ -186,18 +186,28 @@ static action_answer report_zone(server *self, uint32_t, const std::vector<event
     return {};
 }
 
+static action_answer confirm(server *self, uint32_t peer_id, const std::vector<event_field> &) {
+    const commit_result result = server_confirm(self, self->peers[peer_id].name);
+    return {result.code, result.message};
+}
+
 static const struct {
     const char *name;
     action_answer (*run)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
 } actions[] = {
     {ACTION_ADD_INTEREST, add_interest},
     {ACTION_REMOVE_INTEREST, remove_interest},
+    {ACTION_CONFIRM, confirm},
     {"/mgmtd/process/actions/report", report_process},
     {"/mgmtd/time/actions/zonechange", report_zone},
 };
 
+static std::string text_of(const tstring *text) {
+    return text ? ts_str(text) : "";
+}
+
 static void take_action(server *self, uint32_t peer_id, const bn_request_msg *msg) {
-    const std::string name = msg->text ? ts_str(msg->text) : "";
+    const std::string name = text_of(msg->text);
     for (const auto &action : actions)
         if (name == action.name) {
             const action_answer result = action.run(self, peer_id, fields_of(msg));
@@ -209,8 +219,29 @@ static void take_action(server *self, uint32_t peer_id, const bn_request_msg *ms
 
 // --- Changes of the configuration
 
+static commit_order order_of(const peer &who, const bn_request_msg *msg) {
+    commit_order order;
+    order.who = who.name;
+    order.user = who.owner.user;
+    if (const std::string person = text_of(msg->audit_user); !person.empty())
+        order.user += " (" + person + ")";
+    order.cause = text_of(msg->text);
+    if (order.cause.empty())
+        order.cause = who.name;
+    order.check_only = msg->flags & bn_cf_check_only;
+    order.ends_wait = msg->flags & bn_cf_ends_wait;
+    order.revision = msg->number;
+    order.confirm_minutes = msg->flags >> bn_cf_minutes_shift;
+    return order;
+}
+
 static void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
+    constexpr uint32_t known = bn_cf_check_only | bn_cf_ends_wait | ~0u << bn_cf_minutes_shift;
     std::vector<set_step> steps;
+    if (msg->flags & ~known) {
+        answer(self, peer_id, msg, LC_NOT_IMPLEMENTED, "The request has commit flags that are not known");
+        return;
+    }
     const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
     steps.reserve(count);
     for (uint32_t i = 0; i < count; i++) {
@@ -230,15 +261,16 @@ static void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) 
         }
         steps.push_back(std::move(step));
     }
-    const commit_result result = server_commit(self, steps, self->peers[peer_id].name);
+    const commit_result result = server_commit(self, steps, order_of(self->peers[peer_id], msg));
     answer(self, peer_id, msg, result.code, result.message);
 }
 
 // --- Sessions and their messages
 
-void server_peer_opened(server *self, uint32_t peer_id, const std::string &name) {
+void server_peer_opened(server *self, uint32_t peer_id, const std::string &name, const peer_owner &owner) {
     peer &who = self->peers[peer_id];
     who.name = name;
+    who.owner = owner;
     who.first_seen = ++self->peers_seen;
     self->say("session of " + name + " open");
     if (self->opened)
@@ -291,6 +323,7 @@ int64_t server_tick(server *self) {
     int64_t next = -1;
     answer_late_queries(self);
     take_earlier(&next, server_drop_left_groups(self));
+    take_earlier(&next, server_return_unconfirmed(self));
     take_earlier(&next, server_expire_bypasses(self));
     for (const auto &[id, query] : self->pending) // also those that have gone on to another daemon
         take_earlier(&next, query.deadline_ms);
@@ -322,8 +355,7 @@ static bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const t
         take_action(self, peer_id, msg.pointer);
         return true;
     case bn_msg_event:
-        server_take_event(self, peer_id, msg.pointer->text ? ts_str(msg.pointer->text) : "",
-                          fields_of(msg.pointer));
+        server_take_event(self, peer_id, text_of(msg.pointer->text), fields_of(msg.pointer));
         answer(self, peer_id, msg.pointer, 0, "");
         return true;
     default:

@@ -10,8 +10,9 @@
 #include <vector>
 
 #include "peers/mgmtd/config_file.h"
+#include "peers/mgmtd/history.h"
 #include "peers/mgmtd/messages.h"
-#include "peers/mgmtd/node_tree.h"
+#include "peers/nodes/node_tree.h"
 #include "peers/mgmtd/router_addresses.h"
 
 constexpr int64_t MONITOR_TIMEOUT_MS = 5000;
@@ -27,8 +28,14 @@ struct interest {
     std::string event;
     std::vector<std::string> patterns; // of changed nodes; none means all
 };
+// Whose process a session is of.
+struct peer_owner {
+    std::string user = "root"; // its name
+    bool may_change = true;    // or only look
+};
 struct peer {
     std::string name; // "wccpd-123"
+    peer_owner owner = {};
     std::vector<interest> interests;
     uint32_t next_message_id = 1;
     uint64_t first_seen = 0;
@@ -71,6 +78,16 @@ struct left_group {
 };
 constexpr int64_t LEFT_KEEP_MS = 10000; // without a session of tunneld
 
+// Who makes a commit, what for and on which conditions.
+struct commit_order {
+    std::string who;         // in lines of the log
+    std::string user = {}, cause = {}; // in the history
+    bool check_only = false;
+    uint32_t revision = 0;        // that it was made for; 0: any
+    uint32_t confirm_minutes = 0; // in which it has to be confirmed; 0: it stays
+    bool ends_wait = false;       // of another commit for its confirmation; otherwise it is refused
+};
+
 struct server {
     // Whether the peer's queue takes so many bytes more; null: always.
     std::function<bool(uint32_t peer_id, size_t bytes)> fits;
@@ -86,6 +103,8 @@ struct server {
     config_file file;
     node_tree tree;
     config_comments comments;
+    history kept;
+    int64_t return_at_ms = -1; // when the commit that waits to be confirmed is undone; -1: not known yet
     node_map state; // nodes that mgmtd itself reports
     std::map<uint32_t, peer> peers;
     std::map<uint32_t, pending_query> pending;    // by the message id of the forwarded query
@@ -97,7 +116,8 @@ struct server {
     int64_t expire_at_ms = 0; // when bypass entries are looked at again; -1: not before a commit
 };
 
-void server_peer_opened(server *self, uint32_t peer_id, const std::string &name);
+void server_peer_opened(server *self, uint32_t peer_id, const std::string &name,
+                        const peer_owner &owner = {});
 void server_peer_closed(server *self, uint32_t peer_id);
 // A frame of protocol 2, whole. False: it could not be read, and the session ends.
 bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame);
@@ -108,7 +128,7 @@ int64_t server_tick(server *self);
 void server_send_event(server *self, const std::string &event, const std::vector<event_field> &fields);
 // "/pm/events/..." to whoever asked for it.
 void server_process_event(server *self, const std::string &event, const std::string &process);
-commit_result server_commit(server *self, const std::vector<set_step> &steps, const std::string &who);
+commit_result server_commit(server *self, const std::vector<set_step> &steps, const commit_order &order);
 
 // Reads the configuration file. False with its errors; what is to be reported of a file that is good all the
 // same goes to the warnings. Both are lines.
@@ -147,5 +167,29 @@ node_value server_value_for_wccpd(const server *self, const node_name &name, con
 void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout);
 void server_forget_deleted_groups(server *self);
 void server_send_to_wccpd(server *self, const std::vector<node_change> &changes);
+
+// Commits that are kept, in kept_commits.cpp.
+void server_open_history(server *self);
+void server_show_commits(server *self); // as nodes
+// What a commit is about, beside who makes it: the number of nodes that it changes, and the first of them.
+struct commit_extent {
+    size_t changes = 0;
+    const node_name *first = nullptr;
+};
+// Keeps a commit whose configuration is in the file already. False with the reason.
+bool server_keep(server *self, const node_tree &next, const config_comments &comments,
+                 const commit_order &order, commit_extent extent, std::string *out_reason);
+// Writes the file and keeps the commit. False with the reason, and nothing is changed.
+bool server_save(server *self, const node_tree &next, const config_comments &comments,
+                 const commit_order &order, commit_extent extent, std::string *out_reason);
+// Why there can be no commit while another one waits to be confirmed, or "".
+std::string server_wait_for_confirmation(const server *self);
+commit_result server_confirm(server *self, const std::string &who);
+// A commit that nobody has confirmed in time is undone. Gives the time of the next look, or -1.
+int64_t server_return_unconfirmed(server *self);
+// The texts of configurations, which are made when they are asked for.
+bool server_config_text(const server *self, const node_name &name, node_value *out);
+// Makes `next` the configuration, and sends what has changed.
+void server_take_over(server *self, node_tree next, const commit_result &commit);
 // Bypass entries whose time is over are deleted by a commit. Gives the time of the next look, or -1.
 int64_t server_expire_bypasses(server *self);

@@ -7,7 +7,7 @@
 //
 // Creating a child creates the instances that it belongs to. Modifying a child of an instance that does not
 // exist is refused, so that a mistyped number makes no new group.
-#include "peers/mgmtd/node_tree.h"
+#include "peers/nodes/node_tree.h"
 
 #include <algorithm>
 #include <bit>

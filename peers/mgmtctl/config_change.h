@@ -1,0 +1,29 @@
+// Whole configurations: read from what somebody wrote, compared, and turned into the items of one commit.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "peers/mgmtctl/nodes.h"
+#include "peers/mgmtctl/render.h"
+#include "peers/nodes/config_text.h"
+
+// A configuration in mgmtd's format or as JSON, an object of values by the names of their nodes. Passwords
+// that are hidden in it are those of `present`. With `merge` it is laid over `present`. False with
+// complaints, a line for each.
+bool read_config(const std::string &content, const std::string &file, const node_tree &present, bool merge,
+                 node_tree *out, std::string *out_errors);
+
+// What there is to be seen of a change from one to the other: defaults that come and go with a group are
+// left out.
+std::vector<node_change> config_changes(const node_tree &before, const node_tree &after);
+std::vector<ctl_change_item> items_of(const std::vector<node_change> &changes, const node_tree &after);
+// What wccpd makes of it.
+change_notes config_notes(const std::vector<ctl_change_item> &items, const node_tree &before);
+
+std::string text_change(const node_change &change, bool secrets);
+ctl_json json_change(const node_change &change, bool secrets);
+
+// What read_config reads.
+std::string export_text(const config_text &config, bool secrets);
+ctl_json export_json(const node_tree &tree, bool secrets);

@@ -1,0 +1,226 @@
+// A commit is kept as it is written to the configuration file, with a few lines in front that are comments
+// there: a copy of it is a configuration file.
+//
+//   #% commit 17
+//   #% time 1764086301
+//   #% user alice
+//   #% cause apply
+//   #% changes 2
+//   #% what /qv/wccpd/wccp/srv_grp/config/51/weight
+//   #% returns-to 16               until it is confirmed
+//   #% confirm-by 1764086601
+//
+// The configuration file is what counts. A commit is prepared as "pending" before it is replaced, and becomes
+// "commit-17" after, by a rename that needs no room on the disk. Whatever mgmtd is killed in between, the
+// file says at the next start whether the pending commit was made.
+#include "peers/mgmtd/history.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <charconv>
+#include <cstring>
+#include <filesystem>
+#include <map>
+#include <sstream>
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "peers/mgmtd/file_replace.h"
+#include "peers/nodes/config_text.h"
+#include "peers/nodes/schema.h"
+
+static const std::string FILE_PREFIX = "commit-";
+
+static std::string pending_path(const history &self) {
+    return self.directory + "/pending";
+}
+static std::string entry_path(const history &self, uint32_t number) {
+    return self.directory + "/" + FILE_PREFIX + std::to_string(number);
+}
+
+template <typename Number> static bool read_number(const std::string &text, Number *out) {
+    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), *out);
+    return error == std::errc() && end == text.data() + text.size() && !text.empty();
+}
+
+// --- The form of an entry
+
+static std::string format_entry(const history_entry &entry, const std::string &text) {
+    std::vector<std::pair<const char *, std::string>> lines = {
+        {"commit", std::to_string(entry.number)},
+        {"time", std::to_string(entry.time_s)},
+        {"user", shown_text(entry.user)},
+        {"cause", shown_text(entry.cause)},
+        {"changes", std::to_string(entry.changes)},
+        {"what", shown_text(entry.what)},
+    };
+    if (entry.returns_to) {
+        lines.emplace_back("returns-to", std::to_string(entry.returns_to));
+        lines.emplace_back("confirm-by", std::to_string(entry.confirm_by_s));
+    }
+    std::string out;
+    for (const auto &[word, value] : lines)
+        out += std::string(CONFIG_NOTE) + " " + word + " " + value + "\n";
+    return out + "\n" + text;
+}
+
+// False for what was not written by format_entry.
+static bool parse_entry(const std::string &content, history_entry *out, std::string *out_text) {
+    std::map<std::string, std::string> words;
+    size_t at = 0;
+    for (size_t end; content.starts_with(CONFIG_NOTE) && (end = content.find('\n', at)) != std::string::npos;
+         at = end + 1) {
+        std::istringstream line(content.substr(at, end - at));
+        std::string mark, word, value;
+        if (end == at)
+            break;
+        line >> mark >> word;
+        std::getline(line >> std::ws, value);
+        if (mark != CONFIG_NOTE)
+            return false;
+        words[word] = value;
+    }
+    *out = {};
+    out->user = words["user"];
+    out->cause = words["cause"];
+    out->what = words["what"];
+    const bool waits = words.contains("returns-to");
+    if (!read_number(words["commit"], &out->number) || !read_number(words["time"], &out->time_s) ||
+        !read_number(words["changes"], &out->changes) ||
+        (waits && (!read_number(words["returns-to"], &out->returns_to) ||
+                   !read_number(words["confirm-by"], &out->confirm_by_s))) ||
+        at >= content.size())
+        return false;
+    *out_text = content.substr(at + 1);
+    return true;
+}
+
+static bool read_entry(const std::string &path, history_entry *out, std::string *out_text,
+                       std::string *out_reason) {
+    std::optional<std::string> content;
+    if (!read_whole_file(path, &content, out_reason))
+        return false;
+    *out_reason = content ? "is no commit that mgmtd has written" : "there is no such file";
+    return content && parse_entry(*content, out, out_text);
+}
+
+// --- The directory
+
+static void forget_old(history *self) {
+    while (self->entries.size() > HISTORY_MAX) {
+        unlink(entry_path(*self, self->entries.front().number).c_str());
+        self->entries.erase(self->entries.begin());
+    }
+}
+
+static void read_entries(history *self, const std::function<void(const std::string &line)> &say) {
+    std::error_code error;
+    for (std::filesystem::directory_iterator at(self->directory, error), end; !error && at != end;
+         at.increment(error)) {
+        const std::string name = at->path().filename();
+        history_entry entry;
+        uint32_t number = 0;
+        std::string text, reason;
+        if (!name.starts_with(FILE_PREFIX) || !read_number(name.substr(FILE_PREFIX.size()), &number))
+            continue;
+        if (read_entry(at->path(), &entry, &text, &reason) && entry.number == number)
+            self->entries.push_back(std::move(entry));
+        else
+            say("commit " + std::to_string(number) + " can't be read: " + at->path().string() + ": " +
+                (reason.empty() ? "is another commit" : reason));
+    }
+    std::ranges::sort(self->entries, {}, &history_entry::number);
+}
+
+static void settle_pending(history *self, const std::string &content,
+                           const std::function<void(const std::string &line)> &say) {
+    const std::string pending = pending_path(*self);
+    (void)remove_unfinished_file(pending);
+    history_entry entry;
+    std::string text, reason;
+    if (access(pending.c_str(), F_OK) != 0)
+        return;
+    if (read_entry(pending, &entry, &text, &reason) && text == content &&
+        (self->entries.empty() || entry.number > self->entries.back().number)) {
+        if (history_finish(self, entry, &reason))
+            return;
+        say("commit " + std::to_string(entry.number) + " can't be kept: " + reason);
+    }
+    unlink(pending.c_str());
+}
+
+void history_open(history *self, const std::string &content,
+                  const std::function<void(const std::string &line)> &say) {
+    self->entries.clear();
+    if (self->directory.empty())
+        return;
+    read_entries(self, say);
+    settle_pending(self, content, say);
+    forget_old(self);
+}
+
+// --- Commits
+
+static bool failed(const history &self, std::string *out_reason) {
+    *out_reason = self.directory + ": " + strerror(errno);
+    return false;
+}
+
+bool history_prepare(const history &self, const history_entry &entry, const std::string &text,
+                     std::string *out_reason) {
+    if (self.directory.empty())
+        return true;
+    if (mkdir(self.directory.c_str(), S_IRWXU) != 0 && errno != EEXIST)
+        return failed(self, out_reason);
+    if (replace_file(pending_path(self), format_entry(entry, text), S_IRUSR | S_IWUSR, nullptr, out_reason))
+        return true;
+    *out_reason = self.directory + ": " + *out_reason;
+    return false;
+}
+
+void history_abandon(const history &self) {
+    if (!self.directory.empty())
+        unlink(pending_path(self).c_str());
+}
+
+bool history_finish(history *self, const history_entry &entry, std::string *out_reason) {
+    if (self->directory.empty())
+        return true;
+    if (!rename_file(pending_path(*self), entry_path(*self, entry.number)))
+        return failed(*self, out_reason);
+    self->entries.push_back(entry);
+    forget_old(self);
+    return true;
+}
+
+bool history_confirm(history *self, std::string *out_reason) {
+    history_entry entry;
+    std::string text;
+    if (self->entries.empty())
+        return true;
+    const std::string path = entry_path(*self, self->entries.back().number);
+    if (!read_entry(path, &entry, &text, out_reason))
+        return false;
+    entry.returns_to = 0;
+    entry.confirm_by_s = 0;
+    if (!replace_file(path, format_entry(entry, text), S_IRUSR | S_IWUSR, nullptr, out_reason))
+        return false;
+    self->entries.back() = entry;
+    return true;
+}
+
+const history_entry *history_find(const history &self, uint32_t number) {
+    const auto found = std::ranges::find(self.entries, number, &history_entry::number);
+    return found == self.entries.end() ? nullptr : &*found;
+}
+
+bool history_text(const history &self, uint32_t number, std::string *out_text, std::string *out_reason) {
+    history_entry entry;
+    if (!history_find(self, number)) {
+        *out_reason = "commit " + std::to_string(number) + " is not kept";
+        return false;
+    }
+    return read_entry(entry_path(self, number), &entry, out_text, out_reason);
+}

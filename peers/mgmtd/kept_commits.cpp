@@ -1,0 +1,208 @@
+// The commits that are kept, as the server makes them and shows them:
+//
+//   /mgmtd/config/state/text                     the configuration as its file has it
+//   /mgmtd/config/state/commit/N                 below it time, user, cause, changes, what
+//   /mgmtd/config/state/commit/N/text            the configuration after it
+//   /mgmtd/config/state/commit/N/confirm_by      while it waits to be confirmed; and returns_to
+//
+// The texts are made when they are asked for by name; a walk goes without.
+//
+// A commit that waits to be confirmed is always the last one: until it is confirmed or undone there is no
+// other. When its time is over the configuration before it is a new commit. The time that is left is measured
+// by the monotonic clock; only from one start of mgmtd to the next the wall clock tells it, and that can't
+// make it longer than it was.
+#include <algorithm>
+
+#include "mgmt/node_paths.h"
+#include "peers/mgmtd/server.h"
+
+static constexpr int64_t RETRY_MS = 60000; // of a return that failed, as when the disk is full
+
+static const history_entry *waiting_commit(const server *self) {
+    if (self->kept.entries.empty())
+        return nullptr;
+    const history_entry &last = self->kept.entries.back();
+    return last.returns_to != 0 && last.number == self->tree.revision ? &last : nullptr;
+}
+
+// --- Nodes
+
+void server_show_commits(server *self) {
+    static const node_name root = parsed_name(NODE_COMMITS);
+    const auto number = [](uint64_t value) { return node_value{bn_type_uint32, std::to_string(value)}; };
+    const auto clock = [](int64_t value) { return node_value{bn_type_uint64, std::to_string(value)}; };
+    server_remove_report(self, root);
+    for (const history_entry &entry : self->kept.entries) {
+        const node_name name = root.below(std::to_string(entry.number));
+        self->state[name] = number(entry.number);
+        self->state[name.below("time")] = clock(entry.time_s);
+        self->state[name.below("user")] = {bn_type_str, entry.user};
+        self->state[name.below("cause")] = {bn_type_str, entry.cause};
+        self->state[name.below("changes")] = number(entry.changes);
+        self->state[name.below("what")] = {bn_type_str, entry.what};
+        if (&entry != waiting_commit(self))
+            continue;
+        self->state[name.below("confirm_by")] = clock(entry.confirm_by_s);
+        self->state[name.below("returns_to")] = number(entry.returns_to);
+    }
+}
+
+bool server_config_text(const server *self, const node_name &name, node_value *out) {
+    static const node_name present = parsed_name(NODE_CONFIG_TEXT), kept = parsed_name(NODE_COMMITS "/*/text");
+    std::string number, reason;
+    *out = {bn_type_str, ""};
+    if (name == present) {
+        out->text = config_format(self->tree, self->comments);
+        return true;
+    }
+    return matches(kept, name) && canonical_text(bn_type_uint32, name.parts[name.parts.size() - 2], &number) &&
+           history_text(self->kept, static_cast<uint32_t>(std::stoul(number)), &out->text, &reason);
+}
+
+// --- Keeping
+
+static history_entry make_entry(const server *self, uint32_t number, const commit_order &order,
+                                commit_extent extent) {
+    history_entry entry;
+    entry.number = number;
+    entry.time_s = self->clock_s();
+    entry.user = order.user;
+    entry.cause = order.cause;
+    entry.changes = static_cast<uint32_t>(extent.changes);
+    entry.what = extent.first ? extent.first->text() : "";
+    if (order.confirm_minutes) {
+        entry.returns_to = self->tree.revision;
+        entry.confirm_by_s = entry.time_s + int64_t{order.confirm_minutes} * 60;
+    }
+    return entry;
+}
+
+bool server_keep(server *self, const node_tree &next, const config_comments &comments,
+                 const commit_order &order, commit_extent extent, std::string *out_reason) {
+    const history_entry entry = make_entry(self, next.revision, order, extent);
+    return history_prepare(self->kept, entry, config_format(next, comments), out_reason) &&
+           history_finish(&self->kept, entry, out_reason);
+}
+
+// The configuration that a commit replaces is kept as well, whatever has become of it in the history.
+static bool keep_present(server *self, const char *cause, std::string *out_reason) {
+    if (self->kept.directory.empty() || history_find(self->kept, self->tree.revision))
+        return true;
+    return server_keep(self, self->tree, self->comments, {"", "", cause}, {}, out_reason);
+}
+
+bool server_save(server *self, const node_tree &next, const config_comments &comments,
+                 const commit_order &order, commit_extent extent, std::string *out_reason) {
+    if (self->file.path.empty())
+        return true;
+    const history_entry entry = make_entry(self, next.revision, order, extent);
+    if (!keep_present(self, "found", out_reason) ||
+        !history_prepare(self->kept, entry, config_format(next, comments), out_reason))
+        return false;
+    if (!config_save(&self->file, next, comments, out_reason)) {
+        history_abandon(self->kept);
+        return false;
+    }
+    if (std::string reason; !history_finish(&self->kept, entry, &reason)) // the file has it: it is made
+        self->say("commit " + std::to_string(entry.number) + " is not kept: " + reason);
+    self->return_at_ms = -1;
+    return true;
+}
+
+// The configuration that mgmtd starts with is the last commit, or becomes one.
+void server_open_history(server *self) {
+    if (self->file.path.empty())
+        return;
+    self->kept.directory = self->file.path + ".history";
+    history_open(&self->kept, self->file.seen.value_or(""), self->say);
+    std::string text, reason;
+    config_text last;
+    if (!self->kept.entries.empty()) {
+        self->tree.revision = self->kept.entries.back().number;
+        if (!history_text(self->kept, self->tree.revision, &text, &reason) ||
+            !config_parse(text, "", &last) || last.tree.set != self->tree.set)
+            self->tree.revision++;
+    }
+    if (!keep_present(self, "found at the start", &reason))
+        self->say("the configuration is not kept in the history: " + reason);
+    server_show_commits(self);
+}
+
+// --- Confirmation
+
+static std::string clock_text(int64_t time_s) {
+    char text[32];
+    const time_t at = time_s;
+    tm broken{};
+    localtime_r(&at, &broken);
+    return {text, strftime(text, sizeof text, "%F %T", &broken)};
+}
+
+std::string server_wait_for_confirmation(const server *self) {
+    const history_entry *entry = waiting_commit(self);
+    return entry ? "commit " + std::to_string(entry->number) + " waits until " +
+                       clock_text(entry->confirm_by_s) +
+                       " to be confirmed; \"mgmtctl confirm\" keeps it, \"mgmtctl rollback " +
+                       std::to_string(entry->returns_to) + "\" undoes it"
+                 : "";
+}
+
+commit_result server_confirm(server *self, const std::string &who) {
+    const history_entry *entry = waiting_commit(self);
+    std::string reason;
+    if (!entry)
+        return {LC_NOT_FOUND, "No commit waits to be confirmed", {}, {}};
+    const std::string number = std::to_string(entry->number);
+    if (!history_confirm(&self->kept, &reason)) {
+        self->say("commit " + number + " is not confirmed: " + reason);
+        return {LC_IO_ERROR, "The confirmation could not be saved: " + reason, {}, {}};
+    }
+    self->say("commit " + number + " confirmed by " + who);
+    server_show_commits(self);
+    return {0, "commit " + number, {}, {}};
+}
+
+// What was in force once is not checked again as a change: a return must not fail because of where it starts.
+static bool return_to(server *self, const history_entry &entry, std::string *out_reason) {
+    const commit_order order = {"mgmtd", "mgmtd",
+                                "return to commit " + std::to_string(entry.returns_to) + ": commit " +
+                                    std::to_string(entry.number) + " was not confirmed"};
+    std::string content;
+    config_text text;
+    if (!history_text(self->kept, entry.returns_to, &content, out_reason))
+        return false;
+    if (!config_parse(content, "commit " + std::to_string(entry.returns_to), &text)) {
+        *out_reason = text.errors;
+        return false;
+    }
+    const commit_result commit = {0, "", tree_difference(self->tree.nodes, text.tree.nodes), {}};
+    text.tree.revision = self->tree.revision + 1;
+    if (!server_save(self, text.tree, text.comments, order,
+                     {commit.changes.size(), commit.changes.empty() ? nullptr : &commit.changes[0].name},
+                     out_reason))
+        return false;
+    self->say(order.cause);
+    self->comments = std::move(text.comments);
+    server_take_over(self, std::move(text.tree), commit);
+    return true;
+}
+
+int64_t server_return_unconfirmed(server *self) {
+    const history_entry *waiting = waiting_commit(self);
+    if (!waiting)
+        return self->return_at_ms = -1;
+    const history_entry entry = *waiting;
+    const int64_t now = self->now_ms();
+    if (self->return_at_ms < 0) {
+        const int64_t left = entry.confirm_by_s - self->clock_s(), most = entry.confirm_by_s - entry.time_s;
+        self->return_at_ms = now + std::clamp<int64_t>(left, 0, std::max<int64_t>(most, 0)) * 1000;
+    }
+    if (now < self->return_at_ms)
+        return self->return_at_ms;
+    std::string reason;
+    if (return_to(self, entry, &reason))
+        return -1;
+    self->say("commit " + std::to_string(entry.number) +
+              " was not confirmed, and can't be undone yet: " + reason);
+    return self->return_at_ms = now + RETRY_MS;
+}

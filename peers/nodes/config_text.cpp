@@ -1,0 +1,234 @@
+// Reading and writing configurations as text.
+//
+//   # a comment, kept when the file is written again
+//   [/qv/wccpd/wccp/srv_grp/config/51]      the lines that follow are below this node
+//   interface = eth0
+//   router/1/ipaddr = 10.0.0.1
+//   password = "with  blanks"
+//   /qv/wccpd/system/config/mcast_ttl = 4    a name from the root
+//
+// A section of an instance makes the instance, also without lines of its own, and what it belongs to. A value
+// reaches from the first character to the last that is not blank; in quotes \" and \\ stand for the
+// characters themselves. Only what was set is written, never a default.
+#include "peers/nodes/config_text.h"
+
+#include <algorithm>
+
+static std::string trimmed(const std::string &text) {
+    const size_t from = text.find_first_not_of(" \t\r");
+    return from == std::string::npos ? "" : text.substr(from, text.find_last_not_of(" \t\r") + 1 - from);
+}
+
+static bool unquoted(const std::string &text, std::string *out, std::string *out_reason) {
+    *out = text;
+    if (text.empty() || text[0] != '"')
+        return true;
+    out->clear();
+    for (size_t i = 1; i < text.size(); i++) {
+        if (text[i] == '"') {
+            if (i + 1 == text.size())
+                return true;
+            *out_reason = "text after the closing quote";
+            return false;
+        }
+        if (text[i] == '\\' && i + 1 < text.size())
+            i++;
+        *out += text[i];
+    }
+    *out_reason = "the closing quote is missing";
+    return false;
+}
+
+static std::string quoted(const std::string &text) {
+    if (!text.empty() && trimmed(text) == text && text[0] != '"')
+        return text;
+    std::string out = "\"";
+    for (const char c : text) {
+        if (c == '"' || c == '\\')
+            out += '\\';
+        out += c;
+    }
+    return out + '"';
+}
+
+namespace {
+struct parser {
+    config_text *text;
+    int line = 0;
+    std::string section = {}; // "" or an absolute name
+    bool skipping = false;    // the section was refused, and its lines with it
+    std::string pending = {}; // comment lines that wait for what they belong to
+    std::string heading = {}; // those in front of a section of which nothing has come yet
+};
+} // namespace
+
+// The section that a node is written in: its outermost instance, or the node above it.
+static node_name section_of(const node_name &name) {
+    node_name above;
+    for (const std::string &part : name.parts) {
+        above.parts.push_back(part);
+        const schema_row *row = find_schema_row(above);
+        if (row && row->instance)
+            return above;
+    }
+    above.parts.pop_back();
+    return above;
+}
+
+// A section as somebody divides the file need not be one that is written: its comment goes with its first
+// node.
+static void place_heading(parser *state, const node_name &name) {
+    if (!state->heading.empty())
+        state->text->comments.before["[" + section_of(name).text() + "]"] += state->heading;
+    state->heading.clear();
+}
+
+static void make_instances(parser *state, const node_name &name) {
+    for (const node_name &instance : instances_of(name))
+        state->text->tree.set[instance] = instance.parts.back();
+}
+
+static bool take_section(parser *state, const std::string &line, std::string *out_reason) {
+    const std::string name_text = trimmed(line.substr(1, line.size() - 2));
+    node_name name;
+    if (line.back() != ']' || !parse_node_name(name_text, &name)) {
+        *out_reason = "a section is [/name]";
+        return false;
+    }
+    const schema_row *row = find_schema_row(name);
+    std::string text;
+    if (row && row->instance) {
+        if (!check_value(*row, name, "", &text, out_reason))
+            return false;
+        make_instances(state, name);
+        state->text->lines.emplace(name, state->line);
+    }
+    bool known = false;
+    for (const schema_row &candidate : schema()) {
+        node_name above = candidate.parts;
+        if (above.parts.size() < name.parts.size())
+            continue;
+        above.parts.resize(name.parts.size());
+        known = known || matches(above, name);
+    }
+    if (!known) {
+        *out_reason = "nothing can be set below " + shown_text(name.text());
+        return false;
+    }
+    state->section = name.text();
+    state->heading += state->pending;
+    state->pending.clear();
+    if (row && row->instance)
+        place_heading(state, name);
+    return true;
+}
+
+static bool take_value(parser *state, const std::string &line, std::string *out_reason) {
+    const size_t equals = line.find('=');
+    if (equals == std::string::npos) {
+        *out_reason = "expected [section] or name = value";
+        return false;
+    }
+    std::string name_text = trimmed(line.substr(0, equals)), value;
+    if (name_text.empty() || (name_text[0] != '/' && state->section.empty())) {
+        *out_reason = "\"" + shown_text(name_text) + "\" is no name from the root, and it is in no section";
+        return false;
+    }
+    if (name_text[0] != '/')
+        name_text = state->section + "/" + name_text;
+    node_name name;
+    const schema_row *row = parse_node_name(name_text, &name) ? find_schema_row(name) : nullptr;
+    if (!row) {
+        *out_reason = shown_text(name_text) + ": there is no such node in the configuration";
+        return false;
+    }
+    std::string text;
+    if (!unquoted(trimmed(line.substr(equals + 1)), &value, out_reason) ||
+        !check_value(*row, name, value, &text, out_reason)) {
+        *out_reason = shown_text(name.text()) + ": " + *out_reason;
+        return false;
+    }
+    if (const auto [earlier, fresh] = state->text->lines.emplace(name, state->line);
+        !fresh && !row->instance) {
+        *out_reason = name.text() + ": was given in line " + std::to_string(earlier->second) + " already";
+        return false;
+    }
+    make_instances(state, name);
+    state->text->tree.set[name] = text;
+    place_heading(state, name);
+    if (!state->pending.empty())
+        state->text->comments.before[name.text()] += state->pending;
+    state->pending.clear();
+    return true;
+}
+
+std::string config_complaint(const std::string &file, const std::map<node_name, int> &lines,
+                             const std::string &reason) {
+    // The line of the node, or of the last one below it.
+    const node_name about = parsed_name(reason.substr(0, reason.find(": ")));
+    int last = 0;
+    for (const auto &[name, line] : lines)
+        if (name == about || name.is_under(about))
+            last = std::max(last, line);
+    return file + ":" + (last ? std::to_string(last) + ": " : " ") + reason + "\n";
+}
+
+static bool take_line(parser *state, const std::string &line, std::string *out_reason) {
+    if (line[0] == '[') {
+        const bool good = take_section(state, line, out_reason);
+        state->skipping = !good;
+        return good;
+    }
+    return state->skipping || take_value(state, line, out_reason);
+}
+
+bool config_parse_part(const std::string &content, const std::string &file, config_text *out) {
+    *out = {};
+    parser state{out};
+    for (size_t at = 0; at < content.size();) {
+        const size_t end = std::min(content.find('\n', at), content.size());
+        const std::string line = trimmed(content.substr(at, end - at));
+        std::string reason;
+        at = end + 1;
+        state.line++;
+        if (line.starts_with(CONFIG_NOTE))
+            continue;
+        if (!line.empty() && line[0] == '#')
+            state.pending += line + "\n";
+        else if (!line.empty() && !take_line(&state, line, &reason))
+            out->errors.append(file).append(":" + std::to_string(state.line) + ": ").append(reason + "\n");
+    }
+    if (const std::string last = state.heading + state.pending; !last.empty())
+        out->comments.before[""] = last;
+    tree_refresh(&out->tree);
+    return out->errors.empty();
+}
+
+bool config_parse(const std::string &content, const std::string &file, config_text *out) {
+    std::string reason;
+    if (config_parse_part(content, file, out) && !tree_check(out->tree, &reason))
+        out->errors = config_complaint(file, out->lines, reason);
+    return out->errors.empty();
+}
+
+std::string config_format(const node_tree &tree, const config_comments &comments) {
+    std::string out;
+    node_name section;
+    const auto comment = [&](const std::string &key) {
+        const auto found = comments.before.find(key);
+        return found == comments.before.end() ? std::string() : found->second;
+    };
+    for (const auto &[name, text] : tree.set) {
+        if (const node_name here = section_of(name); here != section) {
+            section = here;
+            out += std::string(out.empty() ? "" : "\n") + comment("[" + section.text() + "]") + "[" +
+                   section.text() + "]\n";
+        }
+        if (find_schema_row(name)->instance)
+            continue;
+        out += comment(name.text()) + name.text().substr(section.text().size() + 1) + " = " + quoted(text) +
+               "\n";
+    }
+    const std::string last = comment("");
+    return last.empty() ? out : out + (out.empty() ? "" : "\n") + last;
+}
