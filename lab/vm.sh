@@ -10,6 +10,7 @@
 #
 #   WCCP_BIN    where the programs are (default: build/release/bin)
 #   VM_LIMIT    seconds after which the machine is ended (default 330)
+#   LAB_PLANE   of tunneld (default kernel); LAB_SIDE_BY_SIDE: cases at a time (default 2)
 #   VM_ACCEL    kvm or tcg (default: kvm where that boots, which is tried once; otherwise tcg)
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
@@ -100,8 +101,10 @@ prepare_project() { # ARGUMENTS...
     mkdir -p "$tree"/build/release/{bin,lib} "$tree"/{tests,results,state} || die "no $run"
     cp -r "$top"/{lab,packaging,scripts} "$tree/" && cp "$top"/tests/scenario_*.sh "$tree/tests/" || die "no project"
     for name in "${programs[@]}"; do cp "$WCCP_BIN/$name" "$tree/build/release/bin/" || die "no $name"; done
-    cp "$WCCP_BIN"/../lib/*.so "$tree/build/release/lib/" || die "no libraries"
-    if [ "${1-}" = -- ]; then printf '%q ' "${@:2}" >"$tree/command"; else printf '%q ' lab/vm/cases.sh "$@" >"$tree/command"; fi
+    cp "$WCCP_BIN"/../lib/lib{qvcommondyn,fast_clock}.so "$tree/build/release/lib/" || die "no libraries"
+    if [ "${1-}" = -- ]; then printf '%q ' "${@:2}" >"$tree/command"; else
+        printf '%q ' env "LAB_PLANE=${LAB_PLANE-}" "LAB_SIDE_BY_SIDE=${LAB_SIDE_BY_SIDE-}" lab/vm/cases.sh "$@" >"$tree/command"
+    fi
     make_disk "$tree" "$run/project.img" 256M || die "no disk for the project"
     rm -rf "$tree"
 }

@@ -7,9 +7,9 @@ figure() { # TEXT : a measured value, on the console and with the results
     echo "        $*" | tee -a "$LAB_TOP/results/figures" >/dev/console
 }
 
-# Uploads to a server in the appliance: addressed to it, and by GRE as intercepted flows. The router's side is a GRE link
-# of its kernel, since the simulated router would be slower than either.
-case_throughput() {
+# A server in the appliance, which flows reach by GRE. The router's side is a GRE link of its kernel, which the simulated
+# router would slow down.
+sink_by_gre() {
     start --forward gre --return gre
     lab_appliance a1 10.0.0.101
     lab_gateway a1 10.0.0.1
@@ -22,6 +22,10 @@ case_throughput() {
         ip route add default dev gre1 table 50
         ip rule add iif c1 preference 50 lookup 50
         ip rule add iif c1 to 10.0.0.0/24 preference 49 lookup main' || die "no GRE in the router"
+}
+# Uploads addressed to the server, and as intercepted flows.
+case_throughput() {
+    sink_by_gre
     local i ratios=() plain carried median
     upload plain 10.0.0.101 3129 >/dev/null
     upload carried 10.2.0.2 80 >/dev/null
@@ -45,35 +49,104 @@ upload() { # VARIABLE SERVER PORT : sets it to bytes per second
     printf -v "$1" %s "$(jq '.bytes / .seconds' <<<"$out")"
 }
 
-# wccpd killed: its tunnels are those of the next one. Nothing is twice afterwards.
-case_wccpd_killed() {
+# Large TCP segments, which the router's kernel leaves to the receiver to split: a user-space data plane gets them whole.
+case_large() {
+    sink_by_gre
+    local size carried
+    upload carried 10.2.0.2 80
+    size=$(lab_in a1 ip -j -s link show eth0 | jq '.[0].stats64.rx | .bytes / .packets | round')
+    figure "uploaded in packets of $size bytes, $(jq -n "$carried / 1e6 | round") MB/s"
+    [ "$size" -gt 3000 ] || die "none of them is large"
+    state_is a1 10 tunnel '.[] | .bytes_in > 20000000 and ([.refused[]?] | add // 0) == 0'
+    lab_stop a1 sink
+    finish a1
+}
+
+# The life of an appliance: each form of GRE, a bypass, its proxy down and up again, each of its programs killed, and a
+# reboot. What is in the kernel is the same after each loss, and flows go on.
+case_life() {
     start --forward gre --return gre
-    lab_appliance a1 10.0.0.101
-    lab_gateway a1 10.0.0.1
-    lab_proxy a1
-    lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
+    saved
+    lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 interval=1 fall=2 rise=1 leave_after=3)"
     supervised
     ready 51 a1
-    fetches "$(by a1)" --count 4
-    local before
+    local form before wccpd
+    for form in plain ip redirect; do
+        lab_ctl r1 gre $form >/dev/null
+        fetches "$(by a1)" --count 4
+        fetches "$direct" --count 4 --port 8080
+    done
+    lab_manage a1 bypass add 10.1.0.130/31 >/dev/null || die "no bypass"
+    fetches_within 5 "$bypassed" --count 4 --sources 4
     before=$(kept_in_kernel)
+
+    lab_stop a1 proxy KILL
+    fetches "$direct" --count 4
+    router_is r1 30 51 '$g.appliances == []'
+    fetches "$direct" --count 4
+    lab_proxy a1
+    ready 51 a1
+    fetches_within 5 "$(by a1)" --count 2
+
+    wccpd=$(lab_in a1 pgrep -x wccpd)
+    lab_in a1 pkill -KILL -x tunneld
+    fetches_within 3 "$(by a1)" --count 2
+    same_in_kernel "$before"
+    [ "$(lab_in a1 pgrep -x wccpd)" = "$wccpd" ] || die "wccpd has gone"
+
     lab_in a1 pkill -KILL -x wccpd
-    fetches_within 3 ".failed == 0" --count 4
+    fetches_within 3 '.failed == 0' --count 4
     lab_wait_event 20 a1 '^process wccpd: .*starts again' || die "not seen to end"
     says a1 60 'created GRE tunnel id'
     ready 51 a1
-    fetches "$(by a1)" --count 4
+    fetches "$(by a1)" --count 2
+    same_in_kernel "$before"
+
+    lab_in a1 pkill -KILL -x mgmtd
+    lab_wait_exit 5 a1 mgmtd
+    fetches_within 3 '.failed == 0' --count 2
+    supervised
+    ready 51 a1
+    fetches "$bypassed" --count 4 --sources 4
+    same_in_kernel "$before"
+    sync
+    : >"$LAB_TOP/state/reboot"
+}
+bypassed='.failed == 0 and .proxies == {"": 2, "a1": 2}'
+case_after_reboot() {
+    start --forward gre --return gre
+    saved
+    supervised
+    ready 51 a1
+    fetches "$bypassed" --count 4 --sources 4
     fetches "$direct" --count 4 --port 8080
-    [ "$(kept_in_kernel)" = "$before" ] || die "not the same: $(diff <(echo "$before") <(kept_in_kernel))"
     lab_stop a1 mgmtd || die "mgmtd ended with $?"
     [ -z "$(kept_in_kernel)" ] || die "left: $(kept_in_kernel)"
 }
-kept_in_kernel() { # without what counts
+# An appliance that keeps its configuration on the disk.
+saved() {
+    lab_appliance a1 10.0.0.101
+    lab_gateway a1 10.0.0.1
+    mkdir -p "$LAB_TOP/state/rvl"
+    cp -n "$LAB_TOP"/packaging/*.conf "$LAB_TOP/state/rvl/"
+    lab_in a1 mount --bind "$LAB_TOP/state/rvl" /etc/opt/rvl || die "no disk for the configuration"
+    lab_proxy a1
+}
+same_in_kernel() { # AS IT WAS
+    local i now
+    for ((i = 0; i < 20; i++)); do
+        now=$(kept_in_kernel)
+        [ "$now" != "$1" ] || return 0
+        sleep 0.5
+    done
+    die "not the same: $(diff <(echo "$1") <(echo "$now"))"
+}
+kept_in_kernel() { # without what counts, and in no order: it depends on what was there before
     lab_in a1 bash -c '
         ip -o -d link show group 2048 | cut -d " " -f 2-
-        ip rule | grep -E "lookup 204[0-9]{3}"
+        ip rule | grep -E "lookup 204[0-9]{3}" | sort
         ip route show table all proto 204 | sort
-        nft list table ip tunneld 2>/dev/null | sed "s/packets [0-9]* bytes [0-9]*//"'
+        nft list table ip tunneld 2>/dev/null | sed "s/packets [0-9]* bytes [0-9]*//" | sort'
 }
 
 # 32 tunnels, and an intercept for each of 256 groups: how long a tunneld takes after its start until all of it is in a
@@ -104,36 +177,6 @@ case_many() {
 }
 kept_counts() { # tables of links with a route; intercepts that hand to the proxy
     lab_in a1 bash -c 'echo "[$(ip route show table all proto 204 | grep -c wccp), $(nft list table ip tunneld | grep -c "tproxy")]"'
-}
-
-# What mgmtctl has set is what the machine comes up with after a reboot.
-saved() {
-    start --forward gre --return gre
-    lab_appliance a1 10.0.0.101
-    lab_gateway a1 10.0.0.1
-    mkdir -p "$LAB_TOP/state/rvl"
-    cp -n "$LAB_TOP"/packaging/*.conf "$LAB_TOP/state/rvl/"
-    lab_in a1 mount --bind "$LAB_TOP/state/rvl" /etc/opt/rvl || die "no disk for the configuration"
-    lab_proxy a1
-}
-case_before_reboot() {
-    saved
-    lab_mgmtd_start a1
-    lab_manage a1 group add 51 interface eth0 router 10.0.0.1 || die "no group"
-    lab_manage a1 intercept add 51 port 80 to 3129 || die "no intercept"
-    lab_stop a1 mgmtd
-    supervised
-    ready 51 a1
-    fetches "$(by a1)" --count 4
-}
-case_after_reboot() {
-    saved
-    supervised
-    ready 51 a1
-    fetches "$(by a1)" --count 4
-    fetches "$direct" --count 4 --port 8080
-    lab_stop a1 mgmtd || die "mgmtd ended with $?"
-    [ -z "$(kept_in_kernel)" ] || die "left: $(kept_in_kernel)"
 }
 
 # The cases use what those of traffic are made of.
