@@ -17,6 +17,7 @@
 #include "daemon/wccpd_main.h"
 #include "daemon/wccpd_mgmt.h"
 #include "engine/wccp_debug_utils.h"
+#include "engine/wccp_owners.h"
 #include "engine/wccp_query.h"
 #include "engine/wccp_utils.h"
 #include "mgmt/node_paths.h"
@@ -84,6 +85,8 @@ const mon_dump group_dump = {
 const mon_dump assignment_dump = {
     WCCP_DUMP_ASSIGNMENT_BYTES,
     [](csys_display_buf *b, uint8_t g) { return wccp_print_service_grp_assignment_details(g, b); }, false};
+const mon_dump owners_dump = {WCCP_OWNERS_BYTES,
+                              [](csys_display_buf *b, uint8_t g) { return wccp_print_owners(g, b); }, false};
 
 // First match wins.
 const mon_node mon_nodes[] = {
@@ -117,6 +120,7 @@ const mon_node mon_nodes[] = {
      nullptr},
     {NODE_GROUP_STATE "/*/debug", bn_type_str, nullptr, &group_dump},
     {NODE_GROUP_STATE "/*/assignment", bn_type_str, nullptr, &assignment_dump},
+    {NODE_GROUP_STATE "/*/owners", bn_type_str, nullptr, &owners_dump},
     {NODE_WCCPD_STATE "/debug_global", bn_type_str, nullptr, &global_dump},
     {NODE_WCCPD_STATE "/debug_all", bn_type_str, nullptr, &all_dump},
     {NODE_WCCPD_STATE "/is_alive", bn_type_str,

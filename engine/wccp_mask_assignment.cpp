@@ -62,6 +62,14 @@ static void wccp_mask_assignment_generate_values(wccp_service_group *group) {
     group->mask_value_count = count;
 }
 
+wccp_mask wccp_mask_of_assignment(const wccp_service_group *group) {
+    const wccp_mask configured = {group->mask_src_ip, group->mask_dst_ip, group->mask_src_port,
+                                  group->mask_dst_port};
+    return util_wccp_mask_get_bits_set(&configured) > WCCP_MAX_MASK_BITS
+               ? wccp_mask{0, DEFAULT_DST_IP_MASK, 0, 0}
+               : configured;
+}
+
 void wccp_mask_assignment_calculate_value_table(wccp_service_group *group) {
     group->mask_bit_count = 0;
     memset(group->mask_bit_array, 0, sizeof group->mask_bit_array);
@@ -77,7 +85,7 @@ void wccp_mask_assignment_calculate_value_table(wccp_service_group *group) {
             "dport 0x%x . using defaultdestination MASK 0x%x",
             group->id, static_cast<int>(group->mask_value_bits), mask->src_ip, mask->dst_ip, mask->src_port,
             mask->dst_port, DEFAULT_DST_IP_MASK);
-        *mask = {0, DEFAULT_DST_IP_MASK, 0, 0};
+        *mask = wccp_mask_of_assignment(group);
         group->mask_value_bits = util_wccp_mask_get_bits_set(mask);
     }
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: mask assignment: bits set: %d sip 0x%x dip 0x%x sport 0x%x dport 0x%x ",

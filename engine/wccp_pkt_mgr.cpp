@@ -21,6 +21,7 @@
 #include <cstring>
 
 #include "engine/wccp_complaints.h"
+#include "engine/wccp_owners.h"
 #include "engine/wccp_packet_io.h"
 #include "engine/wccp_pkt_load.h"
 #include "engine/wccp_pkt_unload.h"
@@ -167,6 +168,7 @@ wccp_assign_summary take_map(const wccp_service_group *group, wccp_sending_route
     router->map_src_ip = to_host(map->masks->mask.src_ip);
     router->map_dst_ip = to_host(map->masks->mask.dst_ip);
     router->map_src_port = router->map_dst_port = 0;
+    router->map_in_order = wccp_map_is_in_order(group, map);
     for (uint32_t i = 0; i < router->view_appliance_count; i++)
         memset(router->view_appliances[i].bucket_bits, 0, sizeof router->view_appliances[i].bucket_bits);
 

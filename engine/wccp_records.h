@@ -171,6 +171,7 @@ struct wccp_sending_router {
     uint16_t map_src_port, map_dst_port;
     uint16_t self_buckets;
     uint16_t total_buckets;
+    bool map_in_order; // the last map has the group's own masks and its values in the group's order
 };
 
 // A Here-I-Am that waits to be sent in answer to a Removal Query.

@@ -183,6 +183,44 @@ TEST_F(DaemonMonitor, TheTexts) {
     EXPECT_TRUE(holds(of_51("debug"), "WCCP GROUP 51 INFO END"));
     EXPECT_TRUE(holds(of_51("assignment"), "Received router allocation"));
 
+    // Owners: nothing before there is an agreement, then what routers report, then what is computed here.
+    const auto is_owners = [](const std::string &text) {
+        EXPECT_EQ(of_51("owners"), one(bn_type_str, text));
+    };
+    is_owners("");
+    group->assign_method = WCCP_ASSIGN_HASH;
+    add_appliance(2, 100);
+    add_appliance(1, 100);
+    is_owners("hash members 10.0.0.1 10.0.0.2");
+    wccp_sending_router *reporter = add_router(219);
+    reporter->view_appliance_count = 3; // the bits of the third are those of an earlier report
+    reporter->view_appliances[0] = {address(2), 100, 0, 9, 256, {0xff010000}};
+    reporter->view_appliances[1] = {address(1), 100, 0, 1, 256, {0, 0, 0, 0, 0, 0, 0, 0x80}};
+    reporter->view_appliances[2] = {address(3), 100, 0, 0, 256, {0x00ff0000}};
+    is_owners("hash members 10.0.0.1 10.0.0.2 owners 10.0.0.2*9 0.0.0.0*246 10.0.0.1*1");
+    group->designated = group->dsg_active_count = 1;
+    group->bucket_count = WCCP_MAX_BUCKETS;
+    std::fill_n(group->bucket_ipa, 200, address(1));
+    std::fill_n(group->bucket_ipa + 200, 56, address(2));
+    is_owners("hash members 10.0.0.1 10.0.0.2 owners 10.0.0.1*200 10.0.0.2*56");
+    group->assign_method = WCCP_ASSIGN_MASK; // the table is of another kind, and the router's map unknown
+    group->mask_src_ip = 3;
+    group->mask_dst_ip = 0;
+    reporter->total_buckets = 4;
+    is_owners("mask 3 0 0 0 members 10.0.0.1 10.0.0.2");
+    reporter->map_in_order = true;
+    memset(reporter->view_appliances[0].bucket_bits, 0x05, 1);
+    reporter->view_appliances[1].bucket_bits[0] = 0;
+    is_owners("mask 3 0 0 0 members 10.0.0.1 10.0.0.2 owners 10.0.0.2*1 0.0.0.0*1 10.0.0.2*1 0.0.0.0*1");
+    group->mask_dst_ip = 0x1f10; // too many bits: the mask that the assignment uses instead
+    group->designated = 0;
+    is_owners("mask 0 f00 0 0 members 10.0.0.1 10.0.0.2 owners 10.0.0.2*1 0.0.0.0*1 10.0.0.2*1 0.0.0.0*13");
+    for (uint32_t i = 0; i < WCCP_MAX_BUCKETS; i++) // the longest text fits
+        group->bucket_ipa[i] = to_be32(0xfefefe00 + i);
+    group->assign_method = WCCP_ASSIGN_HASH;
+    group->designated = 1;
+    EXPECT_GT(of_51("owners").size(), 16u * 256);
+
     // Too long: the group's own text comes cut, the others don't come, and nothing fails.
     while (group->sending_router_count < WCCP_MAX_ROUTERS) {
         wccp_sending_router *router = add_router(group->sending_router_count + 20);

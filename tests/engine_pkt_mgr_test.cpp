@@ -370,9 +370,24 @@ TEST_F(Messages, AMapFillsTheRoutersView) {
     EXPECT_EQ(bits(1), 0b0111000100);
     EXPECT_TRUE(group->state_flags & WCCP_STATE_ACTIVE);
 
-    // The next map replaces it.
+    EXPECT_FALSE(made->map_in_order);
+
+    // The next map replaces it. With the group's masks, the values may still be in another order.
+    group->mask_src_ip = 0x41;
+    group->mask_dst_ip = 0x100;
+    group->mask_src_port = group->mask_dst_port = 0;
+    for (const auto &[values, in_order] : std::vector<std::pair<numbers, bool>>{
+             {{0x00100, 0x10000, 0x10100}, false}, {{0, 0x00100, 0x10000}, true}, {{0, 0x10000}, false}}) {
+        wire_bytes ordered = hex("000e 0000 00000001 00000041 00000100 00000000");
+        ordered.u32(static_cast<uint32_t>(values.size()));
+        for (const uint32_t value : values) // a bit of the source, and one of the destination
+            ordered.u32(value >> 16).u32(value & 0x100).u32(0).ip(0, 101);
+        ordered.put16(2, static_cast<uint32_t>(ordered.size() - 4));
+        EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {ordered})), 0);
+        EXPECT_EQ(made->map_in_order, in_order);
+    }
     EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {map({101, 100})})), 0);
-    EXPECT_TRUE(bits(0) == 0b10 && bits(1) == 0b01 && made->self_buckets == 1);
+    EXPECT_TRUE(bits(0) == 0b10 && bits(1) == 0b01 && made->self_buckets == 1 && !made->map_in_order);
 
     // One without a mask element is refused, alone or after a full one, once the views have been updated.
     const wire_bytes empty = hex("000e 0024 00000000"), rest = hex("0063 001c").zeros(28);

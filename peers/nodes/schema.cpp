@@ -155,6 +155,7 @@ const std::vector<const char *> &wccpd_state_nodes() {
         NODE_GROUP_STATE "/*/num_appliances",
         NODE_GROUP_STATE "/*/debug",
         NODE_GROUP_STATE "/*/assignment",
+        NODE_GROUP_STATE "/*/owners",
         NODE_GROUP_STATE "/*/router/*",
         NODE_GROUP_STATE "/*/router/*/state",
         NODE_GROUP_STATE "/*/router/*/fwd_method",

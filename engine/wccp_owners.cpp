@@ -1,0 +1,123 @@
+#include "engine/wccp_owners.h"
+
+#include <cstring>
+
+#include "engine/wccp_debug_pieces.h"
+#include "engine/wccp_mask_assignment.h"
+#include "engine/wccp_utils.h"
+
+namespace {
+
+constexpr be32 NOBODY = {};
+
+// The lowest set bits of `mask` take the lowest bits of `*inout_index`, which are used up.
+uint32_t spread(uint32_t mask, uint32_t *inout_index) {
+    uint32_t value = 0;
+    for (; mask != 0; mask &= mask - 1, *inout_index >>= 1)
+        if (*inout_index & 1)
+            value |= mask & (~mask + 1);
+    return value;
+}
+
+bool is_value(const wccp_mask &mask, uint32_t index, const wccp_wire_mask &found) {
+    return to_host(found.dst_port) == spread(mask.dst_port, &index) &&
+           to_host(found.src_port) == spread(mask.src_port, &index) &&
+           to_host(found.dst_ip) == spread(mask.dst_ip, &index) &&
+           to_host(found.src_ip) == spread(mask.src_ip, &index);
+}
+
+// What a router reports of one appliance. Bits of an earlier report stay where nothing is assigned.
+bool has_slot(const wccp_rtr_view_appliance *entry, bool by_mask, uint32_t slot) {
+    if (entry->buckets_assigned == 0)
+        return false;
+    if (!by_mask) { // the word is in host order, and bucket 0 is the lowest bit of the first byte on the wire
+        const be32 word = to_be32(entry->bucket_bits[slot / 32]);
+        return word.bytes[slot / 8 % 4] >> slot % 8 & 1;
+    }
+    const auto *bytes = reinterpret_cast<const uint8_t *>(entry->bucket_bits);
+    return bytes[slot / 8] >> slot % 8 & 1;
+}
+
+void take_reported(const wccp_sending_router *router, bool by_mask, uint32_t slots, be32 *owners) {
+    for (uint32_t i = 0; i < router->view_appliance_count; i++)
+        for (uint32_t slot = 0; slot < slots; slot++)
+            if (owners[slot] == NOBODY && has_slot(&router->view_appliances[i], by_mask, slot))
+                owners[slot] = router->view_appliances[i].ipa;
+}
+
+// Slots whose owners are known, or 0. A router with another order of values says nothing that could be used.
+uint32_t find_owners(const wccp_service_group *group, bool by_mask, uint32_t slots, be32 *owners) {
+    memset(owners, 0, sizeof *owners * WCCP_MAX_BUCKETS);
+    if (group->designated == 1 && group->bucket_count == slots && group->dsg_active_count != 0) {
+        memcpy(owners, group->bucket_ipa, sizeof *owners * slots);
+        return slots;
+    }
+    for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
+        if (by_mask && router->total_buckets != 0 && !router->map_in_order)
+            return 0;
+    for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
+        take_reported(router, by_mask, slots, owners);
+    for (uint32_t slot = 0; slot < slots; slot++)
+        if (!(owners[slot] == NOBODY))
+            return slots;
+    return 0;
+}
+
+int print_kind(const wccp_service_group *group, bool by_mask, wccp_piece *piece) {
+    const wccp_mask mask = wccp_mask_of_assignment(group);
+    if (by_mask)
+        wccp_piece_add(piece, "mask %x %x %x %x members", mask.src_ip, mask.dst_ip, mask.src_port,
+                       mask.dst_port);
+    else
+        wccp_piece_add(piece, "hash members");
+    for (const wccp_view_appliance *member = group->appliance_view; member; member = member->next)
+        wccp_piece_add(piece, " %s", addr_text(member->ipa).s);
+    return wccp_piece_flush(piece);
+}
+
+int print_owners(const be32 *owners, uint32_t slots, wccp_piece *piece) {
+    wccp_piece_add(piece, " owners");
+    for (uint32_t first = 0, next; first < slots; first = next) {
+        for (next = first + 1; next < slots && owners[next] == owners[first];)
+            next++;
+        wccp_piece_add(piece, " %s*%u", addr_text(owners[first]).s, next - first);
+    }
+    return wccp_piece_flush(piece);
+}
+
+int print_group(const wccp_service_group *group, csys_display_buf *buffer) {
+    const bool by_mask = group->assign_method == WCCP_ASSIGN_MASK;
+    if (!by_mask && group->assign_method != WCCP_ASSIGN_HASH)
+        return 0;
+    wccp_piece piece = wccp_assignment_piece(buffer);
+    WCCP_BAIL_ON_ZERO(print_kind(group, by_mask, &piece));
+    const wccp_mask mask = wccp_mask_of_assignment(group);
+    const uint32_t slots = by_mask ? 1u << util_wccp_mask_get_bits_set(&mask) : WCCP_MAX_BUCKETS;
+    be32 owners[WCCP_MAX_BUCKETS];
+    if (find_owners(group, by_mask, slots, owners) != 0)
+        WCCP_BAIL_ON_ZERO(print_owners(owners, slots, &piece));
+    return 0;
+}
+
+} // namespace
+
+bool wccp_map_is_in_order(const wccp_service_group *group, const wccp_assign_map_info *map) {
+    const wccp_mask mask = wccp_mask_of_assignment(group);
+    const wccp_wire_mask &theirs = map->masks->mask;
+    if (map->element_count != 1 || map->value_count > 1u << util_wccp_mask_get_bits_set(&mask) ||
+        to_host(theirs.src_ip) != mask.src_ip || to_host(theirs.dst_ip) != mask.dst_ip ||
+        to_host(theirs.src_port) != mask.src_port || to_host(theirs.dst_port) != mask.dst_port)
+        return false;
+    for (uint32_t i = 0; i < map->value_count; i++)
+        if (!is_value(mask, i, map->values[i].value))
+            return false;
+    return true;
+}
+
+int wccp_print_owners(int id, csys_display_buf *buffer) {
+    if (!buffer)
+        return 1;
+    const wccp_engine_lock lock;
+    const wccp_service_group *group = wccp_find_group(id);
+    return group ? print_group(group, buffer) : 1;
+}
