@@ -28,8 +28,8 @@
 
 namespace {
 
-// Parts of a name below the state root, counted from 0.
-enum : uint32_t { GROUP_PART = 5, NUMBER_PART = 7, ADDRESS_PART = 9 };
+// Parts of a name below the root of the groups' state, counted from 0, and below the system's.
+enum : uint32_t { GROUP_PART = 5, NUMBER_PART = 7, ADDRESS_PART = 9, SYSTEM_ENTRY_PART = 5 };
 
 // What a request is about, and what the engine said of it.
 struct mon_subject {
@@ -39,7 +39,9 @@ struct mon_subject {
     wccp_grp_info group_info;
     wccp_grp_router_info router;
     wccp_grp_appliance_info appliance;
-    uint32_t load_percent;
+    uint32_t load_percent, counter;
+    wccp_reason_info reason;
+    wccp_interface_info interface;
 };
 
 struct mon_value {
@@ -55,6 +57,8 @@ struct mon_node {
     uint32_t type;
     void (*value)(const mon_subject *subject, mon_value *out);
     const mon_dump *dump;
+    // What else is to be asked for the value; no value when `answered` becomes false.
+    void (*ask)(mon_subject *subject, bool *answered) = nullptr;
 };
 
 const char *address_text(be32 address, mon_value *out) {
@@ -68,6 +72,54 @@ void put_seconds_as_ms(mon_value *out, uint32_t seconds) {
 }
 void put_words(mon_value *out, const char *words) {
     strlcpy(out->text, words, sizeof out->text);
+}
+
+// A number that is one of very many.
+void put_count(mon_value *out, uint32_t number) {
+    snprintf(out->text, sizeof out->text, "%u", number);
+}
+
+// An address that is none is nobody's: no binding, as for an appliance that the router doesn't list.
+void ask_load(mon_subject *subject, bool *answered) {
+    uint32_t address = 0;
+    wccp_router_appliance_info info = {};
+    info.group_id = subject->group;
+    info.router_num = subject->router.router_num;
+    int status = lc_str_to_ipv4addr(tstr_array_get_str_quick(subject->parts, ADDRESS_PART), &address);
+    info.ipa = to_be32(address);
+    if (status == 0)
+        status = wccp_get_router_appliance_info(&info);
+    if (status != 0) {
+        LC_LOG(LC_LOG_ERR, "wccp_get_router_appliance_info: failed: status=%d", status);
+        *answered = false;
+    }
+    subject->load_percent = info.load_percent;
+}
+
+long number_part(const mon_subject *subject, uint32_t index) {
+    const char *text = tstr_array_get_str_quick(subject->parts, index);
+    return text ? strtol(text, nullptr, 10) : 0;
+}
+
+void ask_reason(mon_subject *subject, bool *answered) {
+    const bool of_group = wccpd_is_under(subject->name, NODE_GROUP_STATE);
+    const auto place =
+        static_cast<uint32_t>(number_part(subject, of_group ? NUMBER_PART : SYSTEM_ENTRY_PART));
+    *answered = wccp_get_reason(of_group ? subject->group : WCCP_NO_GROUP, place, &subject->reason) == 0 &&
+                subject->reason.reason.code != WCCP_REASON_NONE;
+}
+
+void ask_counter(mon_subject *subject, bool *answered) {
+    const char *word = tstr_array_get_str_quick(subject->parts, NUMBER_PART);
+    *answered = wccp_get_counter(subject->group, word, &subject->counter) == 0;
+}
+
+void ask_interface(mon_subject *subject, bool *answered) {
+    const char *name = tstr_array_get_str_quick(subject->parts, SYSTEM_ENTRY_PART);
+    for (uint32_t i = 0; name && wccp_get_interface_info(i, &subject->interface) == 0; i++)
+        if (strcmp(subject->interface.name, name) == 0)
+            return;
+    *answered = false;
 }
 
 #define VALUE(statement)                                                                                     \
@@ -87,6 +139,26 @@ const mon_dump assignment_dump = {
     [](csys_display_buf *b, uint8_t g) { return wccp_print_service_grp_assignment_details(g, b); }, false};
 const mon_dump owners_dump = {WCCP_OWNERS_BYTES,
                               [](csys_display_buf *b, uint8_t g) { return wccp_print_owners(g, b); }, false};
+
+#define REASON_NODES(root)                                                                                   \
+    {root "/reason/*/code", bn_type_str, VALUE(put_words(out, wccp_reason_word(s->reason.reason.code))),     \
+     nullptr, ask_reason},                                                                                   \
+        {root "/reason/*/sender", bn_type_ipv4addr, VALUE(address_text(s->reason.reason.sender, out)),       \
+         nullptr, ask_reason},                                                                               \
+        {root "/reason/*/offered", bn_type_str, VALUE(put_words(out, s->reason.reason.offered.s)), nullptr,  \
+         ask_reason},                                                                                        \
+        {root "/reason/*/wanted", bn_type_str, VALUE(put_words(out, s->reason.reason.wanted.s)), nullptr,    \
+         ask_reason},                                                                                        \
+        {root "/reason/*/count", bn_type_uint32, VALUE(put_count(out, s->reason.reason.count)), nullptr,     \
+         ask_reason},                                                                                        \
+        {root "/reason/*/first", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->reason.first_before)), \
+         nullptr, ask_reason},                                                                               \
+    {                                                                                                        \
+        root "/reason/*/last", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->reason.last_before)),    \
+            nullptr, ask_reason                                                                              \
+    }
+#define INTERFACE_NODE(node, type, value)                                                                    \
+    { NODE_WCCPD_STATE "/interface/*/" node, type, VALUE(value), nullptr, ask_interface }
 
 // First match wins.
 const mon_node mon_nodes[] = {
@@ -113,7 +185,7 @@ const mon_node mon_nodes[] = {
     {NODE_GROUP_STATE "/*/router/*/conn_time", bn_type_duration_ms,
      VALUE(put_seconds_as_ms(out, s->router.conn_time)), nullptr},
     {NODE_GROUP_STATE "/*/router/*/appliance/*/load_dist", bn_type_uint32,
-     VALUE(snprintf(out->text, sizeof out->text, "%u", s->load_percent)), nullptr},
+     VALUE(put_count(out, s->load_percent)), nullptr, ask_load},
     {NODE_GROUP_STATE "/*/appliance/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->appliance.ipa, out)),
      nullptr},
     {NODE_GROUP_STATE "/*/appliance/*/weight", bn_type_uint32, VALUE(put_number(out, s->appliance.weight)),
@@ -125,6 +197,22 @@ const mon_node mon_nodes[] = {
     {NODE_WCCPD_STATE "/debug_all", bn_type_str, nullptr, &all_dump},
     {NODE_WCCPD_STATE "/is_alive", bn_type_str,
      VALUE(put_words(out, lc_enum_to_string(wccpd_status_table, m_daemon_status))), nullptr},
+    {NODE_GROUP_STATE "/*/since", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->group_info.since)),
+     nullptr},
+    {NODE_GROUP_STATE "/*/pending_acks", bn_type_uint32, VALUE(put_count(out, s->group_info.pending_acks)),
+     nullptr},
+    {NODE_GROUP_STATE "/*/router/*/heard", bn_type_duration_ms,
+     VALUE(put_seconds_as_ms(out, s->router.heard)), nullptr},
+    {NODE_GROUP_STATE "/*/counter/*", bn_type_uint32, VALUE(put_count(out, s->counter)), nullptr,
+     ask_counter},
+    REASON_NODES(NODE_GROUP_STATE "/*"),
+    REASON_NODES(NODE_WCCPD_STATE),
+    INTERFACE_NODE("address", bn_type_ipv4addr, address_text(s->interface.ipa, out)),
+    INTERFACE_NODE("link", bn_type_str, put_words(out, s->interface.link_up ? "up" : "down")),
+    INTERFACE_NODE("starts", bn_type_uint32, put_count(out, s->interface.starts)),
+    INTERFACE_NODE("stops", bn_type_uint32, put_count(out, s->interface.stops)),
+    INTERFACE_NODE("link_downs", bn_type_uint32, put_count(out, s->interface.link_downs)),
+    INTERFACE_NODE("address_changes", bn_type_uint32, put_count(out, s->interface.address_changes)),
 };
 
 // Nodes that exist so that what iterate finds can be listed; they answer with their own last part.
@@ -132,15 +220,13 @@ const char *const wildcard_nodes[] = {
     NODE_GROUP_STATE "/*",
     NODE_GROUP_STATE "/*/router/*",
     NODE_GROUP_STATE "/*/router/*/appliance/*",
+    NODE_GROUP_STATE "/*/reason/*",
+    NODE_WCCPD_STATE "/reason/*",
+    NODE_WCCPD_STATE "/interface/*",
 };
 
 bool matches(const mon_subject *subject, const char *pattern) {
     return bn_binding_name_parts_pattern_match(subject->parts, 1, pattern) != 0;
-}
-
-long number_part(const mon_subject *subject, uint32_t index) {
-    const char *text = tstr_array_get_str_quick(subject->parts, index);
-    return text ? strtol(text, nullptr, 10) : 0;
 }
 
 lc_status append_text(const char *name, uint32_t type, const char *text, bn_binding_array *out) {
@@ -195,23 +281,6 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
         }
     }
     return LC_OK;
-}
-
-// An address that is none is nobody's: no binding, as for an appliance that the router doesn't list.
-void ask_load(mon_subject *subject, bool *answered) {
-    uint32_t address = 0;
-    wccp_router_appliance_info info = {};
-    info.group_id = subject->group;
-    info.router_num = subject->router.router_num;
-    int status = lc_str_to_ipv4addr(tstr_array_get_str_quick(subject->parts, ADDRESS_PART), &address);
-    info.ipa = to_be32(address);
-    if (status == 0)
-        status = wccp_get_router_appliance_info(&info);
-    if (status != 0) {
-        LC_LOG(LC_LOG_ERR, "wccp_get_router_appliance_info: failed: status=%d", status);
-        *answered = false;
-    }
-    subject->load_percent = info.load_percent;
 }
 
 struct dump_failures_logged_at {
@@ -272,8 +341,8 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
             CHECK_STATUS(append_dump(&subject, &node, in_walk && *static_cast<const bool *>(in_walk), out));
             return LC_OK;
         }
-        if (strcmp(last, "load_dist") == 0)
-            ask_load(&subject, &answered);
+        if (node.ask)
+            node.ask(&subject, &answered);
         if (!answered)
             return LC_OK;
         mon_value value = {};
@@ -326,6 +395,33 @@ lc_status iterate_routers(const mon_subject *subject, tstr_array *out) {
     return LC_OK;
 }
 
+lc_status append_reasons(int group, tstr_array *out) {
+    wccp_reason_list list = {};
+    (void)wccp_get_reason_list(group, &list); // a group that is gone has none
+    for (uint32_t i = 0; i < list.count; i++)
+        CHECK_STATUS(append_number(out, list.places[i]));
+    return LC_OK;
+}
+lc_status iterate_group_reasons(const mon_subject *subject, tstr_array *out) {
+    return append_reasons(static_cast<uint8_t>(number_part(subject, GROUP_PART)), out);
+}
+lc_status iterate_other_reasons(const mon_subject *, tstr_array *out) {
+    return append_reasons(WCCP_NO_GROUP, out);
+}
+
+lc_status iterate_counters(const mon_subject *, tstr_array *out) {
+    for (uint32_t i = 0; wccp_counter_word(i); i++)
+        CHECK_STATUS(append_name(out, wccp_counter_word(i)));
+    return LC_OK;
+}
+
+lc_status iterate_interfaces(const mon_subject *, tstr_array *out) {
+    wccp_interface_info info;
+    for (uint32_t i = 0; wccp_get_interface_info(i, &info) == 0; i++)
+        CHECK_STATUS(append_name(out, info.name));
+    return LC_OK;
+}
+
 lc_status iterate_groups(const mon_subject *, tstr_array *out) {
     static_assert(sizeof(wccp_grp_list) == 260);
     owned<void, wccp_free> memory(wccp_malloc(sizeof(wccp_grp_list)));
@@ -355,6 +451,10 @@ lc_status wccpd_mon_handle_iterate(const char *node_name, const tstr_array *name
         {NODE_GROUP_STATE "/*/router/*/appliance", iterate_router_appliances},
         {NODE_GROUP_STATE "/*/router", iterate_routers},
         {NODE_GROUP_STATE, iterate_groups},
+        {NODE_GROUP_STATE "/*/reason", iterate_group_reasons},
+        {NODE_GROUP_STATE "/*/counter", iterate_counters},
+        {NODE_WCCPD_STATE "/reason", iterate_other_reasons},
+        {NODE_WCCPD_STATE "/interface", iterate_interfaces},
     };
     LC_LOG(LC_LOG_DEBUG, "iterate %s", node_name);
     mon_subject subject = {};

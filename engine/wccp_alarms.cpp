@@ -212,6 +212,15 @@ static bool is_without_its_share(const wccp_rtr_view_appliance *entry) {
     return entry->buckets_assigned == 0 && entry->weight != 0;
 }
 
+// What a router gives to an appliance, or to any, and what it should give at least.
+static void note_difference(wccp_service_group *group, const wccp_sending_router *router, be32 appliance,
+                            uint32_t has, uint32_t wanted) {
+    const wccp_addr_text who = addr_text(appliance);
+    wccp_note_reason(group, WCCP_REASON_ASSIGNMENT_DIFFERS, router->router_id,
+                     wccp_reason_value("%u buckets for %s", has, is_zero(appliance) ? "anybody" : who.s),
+                     wanted == 1 ? wccp_reason_value("some") : wccp_reason_value("%u", wanted));
+}
+
 // What the designated appliance asked for, against what each router reports.
 static bool routers_carry_out_our_table(wccp_service_group *group) {
     for (uint32_t i = 0; i < WCCP_MAX_APPLIANCES; i++) {
@@ -231,6 +240,7 @@ static bool routers_carry_out_our_table(wccp_service_group *group) {
                    "WCCP GRP %d: alarm: allocation mismatch. appliance %s buckets dsg: %d router %s %d",
                    group->id, addr_text(asked->ipa).s, asked->assigned, addr_text(router->router_id).s,
                    static_cast<int>(buckets));
+            note_difference(group, router, asked->ipa, buckets, asked->assigned);
             return false;
         }
     }
@@ -243,6 +253,7 @@ static bool routers_carry_out_our_table(wccp_service_group *group) {
                    "WCCP GRP %d: alarm: allocation mismatch. appliance %s weight : %d router %s buckets : %d",
                    group->id, addr_text(entry->ipa).s, entry->weight, addr_text(router->router_id).s,
                    entry->buckets_assigned);
+            note_difference(group, router, entry->ipa, 0, 1);
             return false;
         }
     }
@@ -262,11 +273,13 @@ static bool routers_redirect_without_holes(wccp_service_group *group) {
             QV_LOG(LC_LOG_WARNING,
                    "WCCP GRP %d: alarm: router %s is not redirecting to appliance (%s weight %d)", group->id,
                    addr_text(router->router_id).s, addr_text(entry->ipa).s, entry->weight);
+            note_difference(group, router, entry->ipa, 0, 1);
             return false;
         }
         if (!redirects) {
             QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: alarm: router %s is not redirecting to ANY appliance.",
                    group->id, addr_text(router->router_id).s);
+            note_difference(group, router, {}, 0, 1);
             return false;
         }
     }
@@ -278,6 +291,7 @@ int wccp_alarms_verify_allocation_table(wccp_service_group *group) {
     const bool in_order =
         group->designated == 1 ? routers_carry_out_our_table(group) : routers_redirect_without_holes(group);
     const bool raised = stands(group, WCCP_ALARM_ASSIGNMENT);
+    wccp_forget_older_reasons(group, WCCP_REASON_ASSIGNMENT_DIFFERS);
     if (in_order && raised)
         wccp_alarm_clear_alarm(group, WCCP_ALARM_ASSIGNMENT);
     else if (!in_order && !raised)

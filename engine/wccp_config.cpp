@@ -222,6 +222,7 @@ int wccp_add_group(const wccp_grp_config *config) {
     wccp_g.group_count++;
     wccp_if_add_group(group, interface);
     if (group->mcast_configured && wccp_join_mc_grp(interface, group->mcast_ipa)) {
+        wccp_note_network(group);
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: cannot join %s on interface %s now", group->id,
                addr_text(group->mcast_ipa).s, interface->name);
         return 1;
@@ -234,19 +235,23 @@ void wccp_start_service_group(wccp_service_group *group) {
     group->assign_timer.active = 0;
     wccp_flush_group_lists(group);
     forget_agreement(group);
+    wccp_forget_all_reasons(group);
+    group->start_time = wccp_g.seconds;
     wccp_appliance_state_init(group);
     if (group->admin_state != WCCP_ADMIN_UP) {
         QV_LOG(LC_LOG_NOTICE, "WCCP GRP %d: not started (admin disabled)", group->id);
         return;
     }
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 0);
+    wccp_note_network(group);
     if (!wccp_if_is_ready(group->interfaces[0])) {
         QV_LOG(LC_LOG_NOTICE, "WCCP GRP %d: not launched (links are not ready)", group->id);
         return;
     }
     start_timer(&group->hia_timer, HERE_I_AM_SECONDS, 1);
     start_timer(&group->monitor_timer, MONITOR_SECONDS, MONITOR_SECONDS);
-    wccp_set_L2_return(group->id, group->force_l2_return);
+    if (wccp_set_L2_return(group->id, group->force_l2_return) != 0 && group->force_l2_return)
+        wccp_note_reason(group, WCCP_REASON_TUNNELD_SILENT, {}, {}, wccp_reason_value("return by L2"));
 }
 
 int wccp_notify_service_group_shutdown(wccp_service_group *group) {
@@ -267,6 +272,9 @@ void wccp_stop_service_group(wccp_service_group *group) {
     group->monitor_timer.active = 0;
     wccp_flush_group_lists(group);
     forget_agreement(group);
+    wccp_forget_all_reasons(group);
+    wccp_note_network(group);
+    group->start_time = wccp_g.seconds;
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 1);
     wccp_appliance_state_init(group);
 }
@@ -485,6 +493,8 @@ void wccp_start_waiting_groups(wccp_interface *interface) {
 void wccp_recover_interface(wccp_interface *interface) {
     if (wccp_retry_network(interface))
         wccp_start_waiting_groups(interface);
+    for (wccp_service_group *group = interface->groups; group; group = group->if_next)
+        wccp_note_network(group);
 }
 
 void wccp_recover_interfaces_due() {

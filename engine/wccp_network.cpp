@@ -62,18 +62,19 @@ void widen_buffer(int fd, int forced, int within_limits) {
         (void)setsockopt(fd, SOL_SOCKET, within_limits, &BUFFER, sizeof BUFFER);
 }
 
-// A datagram socket with these options, or -1; each failure has its log line.
+// A datagram socket with these options, or -1; each failure has its log line, and the interface its errno.
 template <size_t Count>
-int open_socket(const wccp_interface *interface, const char *open_failure,
-                const socket_option (&options)[Count]) {
+int open_socket(wccp_interface *interface, const char *open_failure, const socket_option (&options)[Count]) {
     const int fd = socket(AF_INET, SOCK_DGRAM, 0);
     if (fd < 0) {
+        interface->network_error = errno;
         QV_LOG(LC_LOG_ERR, open_failure, interface->name);
         return -1;
     }
     for (const socket_option &option : options) {
         if (setsockopt(fd, option.level, option.name, option.value, option.length) == 0)
             continue;
+        interface->network_error = errno;
         QV_LOG(LC_LOG_ERR, option.failure, interface->name);
         close(fd);
         return -1;
@@ -96,9 +97,11 @@ int open_unicast(wccp_interface *interface) {
         return 1;
     // A socket that cannot be bound stays open; it is `ucast_bound` that permits sending.
     const int result = bind_to(fd, interface->ipa);
-    if (result != 0)
+    if (result != 0) {
+        interface->network_error = errno;
         QV_LOG(LC_LOG_ERR, "WCCP: net init: %s Cannot bind unicast UDP socket to %s:%d: %m", interface->name,
                addr_text(interface->ipa).s, WCCP_PORT);
+    }
     wccp_set_descriptor(&interface->ucast_fd, fd);
     if (result != 0)
         return 1;
@@ -122,6 +125,7 @@ int open_multicast(wccp_interface *interface) {
         return 1;
     wccp_set_descriptor(&interface->mcast_fd, fd);
     if (setsockopt(fd, IPPROTO_IP, IP_MULTICAST_IF, &interface->ipa, sizeof interface->ipa) != 0) {
+        interface->network_error = errno;
         QV_LOG(LC_LOG_ERR, "WCCP: net init %s: Cannot set mcast output interface to: %s. %m", interface->name,
                addr_text(interface->ipa).s);
         return 1;
@@ -222,6 +226,7 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
         return 1;
     if (!interface->mcast_bound) {
         if (bind_to(interface->mcast_fd, address) != 0) {
+            interface->network_error = errno;
             QV_LOG(LC_LOG_ERR, "WCCP: Interface %s: Cannot bind mcast UDP socket to %s:%d. %m",
                    interface->name, addr_text(address).s, WCCP_PORT);
             // Sending gives the unbound socket another port: a retry needs a new one.
@@ -246,6 +251,7 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
                interface->name, addr_text(address).s);
         return 0;
     }
+    interface->network_error = errno;
     QV_LOG(LC_LOG_ERR, "WCCP: Interface %s: Failed to join multicast group: %s, errno: %m", interface->name,
            addr_text(address).s);
     interface->network_flaws |= WCCP_FLAW_JOIN;
@@ -257,6 +263,36 @@ int wccp_config_mcast(wccp_interface *interface) {
         if (group->mcast_configured)
             wccp_join_mc_grp(interface, group->mcast_ipa);
     return 0;
+}
+
+// What keeps the interface from carrying its groups' packets, first what the others follow from.
+static wccp_reason_code find_network_fault(const wccp_interface *interface) {
+    if (!wccp_if_is_ready(interface) && wccp_get_device(interface->name) == 0)
+        return WCCP_REASON_INTERFACE_MISSING;
+    if (!(interface->ready_flags & WCCP_LINK_READY))
+        return WCCP_REASON_INTERFACE_DOWN;
+    if (!(interface->ready_flags & WCCP_IPA_READY))
+        return WCCP_REASON_INTERFACE_NO_ADDRESS;
+    if (interface->network_flaws & WCCP_FLAW_SOCKETS)
+        return interface->network_error == EADDRINUSE ? WCCP_REASON_PORT_TAKEN : WCCP_REASON_SOCKET_FAILED;
+    return interface->network_flaws & WCCP_FLAW_JOIN ? WCCP_REASON_JOIN_FAILED : WCCP_REASON_NONE;
+}
+
+void wccp_note_network(wccp_service_group *group) {
+    static constexpr wccp_reason_code faults[] = {
+        WCCP_REASON_INTERFACE_MISSING, WCCP_REASON_INTERFACE_DOWN, WCCP_REASON_INTERFACE_NO_ADDRESS,
+        WCCP_REASON_PORT_TAKEN,        WCCP_REASON_SOCKET_FAILED,  WCCP_REASON_JOIN_FAILED,
+    };
+    const wccp_interface *interface = group->interfaces[0];
+    const wccp_reason_code fault = interface ? find_network_fault(interface) : WCCP_REASON_NONE;
+    for (const wccp_reason_code each : faults)
+        if (each != fault)
+            wccp_forget_reasons(group, each);
+    if (fault == WCCP_REASON_NONE)
+        return;
+    const char *error = wccp_if_is_ready(interface) ? strerrordesc_np(interface->network_error) : "";
+    wccp_note_reason(group, fault, {}, wccp_reason_value("%s", error ? error : "unknown error"),
+                     wccp_reason_value("%s", interface->name));
 }
 
 be32 wccp_get_address(const char *name) {

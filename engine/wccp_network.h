@@ -18,6 +18,8 @@ int wccp_config_mcast(wccp_interface *interface);
 // The body of a receive thread (cthread start function).
 void *wccp_rx_thread_fn(void *interface);
 
+// Notes why the group's interface cannot carry its packets, or that it can. Lock held.
+void wccp_note_network(wccp_service_group *group);
 be32 wccp_get_address(const char *name);       // 0 when it has none
 int32_t wccp_get_device(const char *name);     // the kernel's index, 0 when there is none
 uint32_t wccp_get_if_status(const char *name); // 1 up and running

@@ -22,9 +22,12 @@
 
 #include "engine/wccp_packet_io.h"
 
+#include <errno.h>
 #include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>
+
+#include <cstring>
 
 #include "engine/wccp_utils.h"
 #include "runtime/guards.h"
@@ -43,10 +46,21 @@ void close_descriptor(int32_t *cell) {
     *cell = -1;
 }
 
-int32_t send_to(int fd, const wccp_pkt *pkt, be32 address) {
+int32_t send_to(wccp_service_group *group, int fd, const wccp_pkt *pkt, be32 address) {
     const sockaddr_in to = wccp_socket_address(address);
-    return static_cast<int32_t>(
+    const auto sent = static_cast<int32_t>(
         sendto(fd, pkt->data, pkt->length, 0, reinterpret_cast<const sockaddr *>(&to), sizeof to));
+    if (sent < 0) {
+        const int error = errno;
+        const char *words = strerrordesc_np(error);
+        wccp_note_reason(group, WCCP_REASON_SEND_FAILED, address,
+                         wccp_reason_value("%s", words ? words : "unknown error"),
+                         wccp_reason_value("%u bytes", pkt->length));
+        errno = error;
+    } else {
+        wccp_forget_reason(group, WCCP_REASON_SEND_FAILED, address);
+    }
+    return sent;
 }
 
 } // namespace
@@ -84,15 +98,15 @@ int32_t wccp_tx_pkt(wccp_service_group *group, wccp_pkt *pkt) {
     if (!interface->ucast_bound)
         return 0;
     if (!is_zero(pkt->ipa))
-        return send_to(interface->ucast_fd, pkt, pkt->ipa);
+        return send_to(group, interface->ucast_fd, pkt, pkt->ipa);
     if (group->mcast_configured) {
         pkt->ipa = group->mcast_ipa;
-        return send_to(interface->mcast_fd, pkt, pkt->ipa);
+        return send_to(group, interface->mcast_fd, pkt, pkt->ipa);
     }
     int32_t sum = 0;
     for (uint32_t i = 0; i < group->ucast_router_count; i++) {
         pkt->ipa = group->ucast_routers[i];
-        sum += send_to(interface->ucast_fd, pkt, pkt->ipa);
+        sum += send_to(group, interface->ucast_fd, pkt, pkt->ipa);
     }
     return sum;
 }

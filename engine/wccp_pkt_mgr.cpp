@@ -38,6 +38,11 @@ static int failed(const char *words, int status) {
     return status;
 }
 
+static void note_malformed(wccp_service_group *group, const wccp_pkt *pkt, const wccp_reason_text &offered,
+                           const wccp_reason_text &wanted) {
+    wccp_note_reason(group, WCCP_REASON_MESSAGE_MALFORMED, pkt->ipa, offered, wanted);
+}
+
 // An I-See-You.
 
 namespace {
@@ -91,7 +96,11 @@ int read_optional_component(wccp_service_group *group, wccp_pkt *pkt, icu_messag
     return wccp_pkt_unload_unknown_component(group, pkt) ? failed("unloading unknown component", 1) : 0;
 }
 
-// The message as a whole: its components in their order, and no change of the group.
+wccp_reason_text service_text(uint32_t priority, uint32_t protocol, uint32_t flags) {
+    return wccp_reason_value("priority %u, protocol %u, flags 0x%x", priority, protocol, flags);
+}
+
+// The message as a whole: its components in their order, and no change of the group but its reasons.
 int read_icu(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_info *service,
              icu_message *icu) {
     *icu = {};
@@ -104,6 +113,9 @@ int read_icu(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_i
     const uint32_t flags = to_host(service->flags);
     if (service->priority != group->priority || service->protocol != group->protocol ||
         flags != group->service_flags) {
+        wccp_note_reason(group, WCCP_REASON_SERVICE_MISMATCH, icu->router_id,
+                         service_text(service->priority, service->protocol, flags),
+                         service_text(group->priority, group->protocol, group->service_flags));
         WCCP_COMPLAIN(
             LC_LOG_WARNING,
             "WCCP GRP %d: service group config mismatch (router id: %s) .priority: rxed = %u local = %u, "
@@ -120,6 +132,8 @@ int read_icu(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_i
         if (++count > OPTIONAL_COMPONENTS) {
             WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: ICU bogus packet  (too many optional components).",
                           group->id);
+            note_malformed(group, pkt, wccp_reason_value("%u optional components", count),
+                           wccp_reason_value("%u at most", OPTIONAL_COMPONENTS));
             return 1;
         }
     }
@@ -140,6 +154,10 @@ wccp_sending_router *find_or_create_router(wccp_service_group *group, const icu_
     return compatible ? wccp_create_sending_router(group, icu->router_id, &icu->offered, &agreed) : nullptr;
 }
 
+wccp_reason_text key_text(be32 address, uint32_t change) {
+    return wccp_reason_value("table %s number %u", addr_text(address).s, change);
+}
+
 void take_acknowledgement(wccp_service_group *group, wccp_sending_router *router,
                           const wccp_rtr_view_info *view) {
     if (!(router->flags & WCCP_RTR_ASSIGN_UNACKED))
@@ -148,6 +166,7 @@ void take_acknowledgement(wccp_service_group *group, wccp_sending_router *router
     if (view->key_ipa == group->appliance_ipa && key_change == group->dsg_key_change &&
         router->assign_tx_count > 1) {
         router->flags &= ~WCCP_RTR_ASSIGN_UNACKED;
+        wccp_forget_reason(group, WCCP_REASON_NOT_ACKNOWLEDGED, router->router_id);
         if (group->pending_acks != 0)
             group->pending_acks--;
         if (group->pending_acks == 0)
@@ -160,6 +179,10 @@ void take_acknowledgement(wccp_service_group *group, wccp_sending_router *router
            group->id, addr_text(router->router_id).s, addr_text(group->appliance_ipa).s,
            group->dsg_key_change, addr_text(view->key_ipa).s, key_change,
            static_cast<int>(router->assign_tx_count), group->pending_acks);
+    if (router->assign_tx_count > 1)
+        wccp_note_reason(group, WCCP_REASON_NOT_ACKNOWLEDGED, router->router_id,
+                         key_text(view->key_ipa, key_change),
+                         key_text(group->appliance_ipa, group->dsg_key_change));
 }
 
 // Takes the values of an Assignment Map into the router's view, and counts those of this appliance.
@@ -193,6 +216,43 @@ wccp_assign_summary take_map(const wccp_service_group *group, wccp_sending_route
     return summary;
 }
 
+// The mask that the router uses, as the designated appliance gave it.
+void check_mask(wccp_service_group *group, const wccp_sending_router *router, const wccp_wire_mask *mask) {
+    const bool same =
+        to_host(mask->src_ip) == group->mask_src_ip && to_host(mask->dst_ip) == group->mask_dst_ip &&
+        to_host(mask->src_port) == group->mask_src_port && to_host(mask->dst_port) == group->mask_dst_port;
+    // A designated appliance has given it itself, or will; too wide a mask is replaced by every appliance.
+    if (same || group->designated == 1 || group->mask_bits > WCCP_MAX_MASK_BITS)
+        return;
+    const auto text = [](uint32_t src_ip, uint32_t dst_ip, uint32_t src_port, uint32_t dst_port) {
+        return wccp_reason_value("src 0x%x dst 0x%x ports 0x%x 0x%x", src_ip, dst_ip, src_port, dst_port);
+    };
+    wccp_note_reason(
+        group, WCCP_REASON_MASK_DIFFERS, router->router_id,
+        text(to_host(mask->src_ip), to_host(mask->dst_ip), to_host(mask->src_port), to_host(mask->dst_port)),
+        text(group->mask_src_ip, group->mask_dst_ip, group->mask_src_port, group->mask_dst_port));
+}
+
+// Another appliance that assigns by another method shows in the form of its entry in the router's view.
+void check_methods(wccp_service_group *group, const wccp_sending_router *router,
+                   const wccp_rtr_view_appliance *decoded, uint32_t count, uint32_t by_mask) {
+    for (uint32_t i = 0; i < count; i++) {
+        const uint32_t method = (by_mask >> i & 1) != 0 ? WCCP_ASSIGN_MASK : WCCP_ASSIGN_HASH;
+        if (method != group->assign_method && !(decoded[i].ipa == group->appliance_ipa))
+            wccp_note_reason(
+                group, WCCP_REASON_METHOD_DIFFERS, router->router_id,
+                wccp_reason_value("%s by %s", wccp_assign_method_name(method), addr_text(decoded[i].ipa).s),
+                wccp_reason_value("%s", wccp_assign_method_name(group->assign_method)));
+    }
+}
+
+void check_listing(wccp_service_group *group, const wccp_sending_router *router) {
+    if (!(router->flags & WCCP_RTR_TWO_WAY))
+        wccp_note_reason(group, WCCP_REASON_NOT_IN_VIEW, router->router_id,
+                         wccp_reason_value("%u appliances", router->view_appliance_count),
+                         wccp_reason_value("%s", addr_text(group->appliance_ipa).s));
+}
+
 } // namespace
 
 int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
@@ -216,16 +276,26 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
     wccp_assign_summary hash = {}, mask = {};
     status = wccp_process_router_view_web_cache_id_elements(group, icu.view.appliance_count,
                                                             icu.view.appliances, decoded, &hash);
-    if (status == 0)
+    if (status != 0)
+        note_malformed(group, pkt, wccp_reason_value("its appliances"), {});
+    else
         status = wccp_update_appliance_view(group, router, icu.view.appliance_count, decoded);
     if (status != 0)
         return status;
     if (icu.map.present) {
-        if (!icu.map.masks || !icu.map.values)
+        if (!icu.map.masks || !icu.map.values) {
+            note_malformed(group, pkt, wccp_reason_value("an assignment map without a mask"), {});
             return 1;
+        }
         mask = take_map(group, router, &icu.map);
+        check_mask(group, router, &icu.map.masks->mask);
     }
-    return wccp_update_appliance_redirect_status(group, router, &hash, &mask);
+    check_methods(group, router, decoded, icu.view.appliance_count, hash.mask_forms);
+    check_listing(group, router);
+    status = wccp_update_appliance_redirect_status(group, router, &hash, &mask);
+    if (status == 0)
+        wccp_forget_refusals(group, router->router_id, pkt->ipa);
+    return status;
 }
 
 int wccp_pkt_process_removal_query(wccp_service_group *group, wccp_pkt *pkt) {
@@ -258,6 +328,11 @@ static bool digest_is_right(const wccp_service_group *group, const wccp_pkt *pkt
     return memcmp(received, computed, sizeof received) == 0;
 }
 
+static wccp_reason_text security_text(uint32_t option) {
+    return option <= 1 ? wccp_reason_value("%s", option ? "MD5" : "none")
+                       : wccp_reason_value("option %u", option);
+}
+
 // True when the packet has the security that the group asks for.
 static bool passes_security(wccp_service_group *group, const wccp_pkt *pkt,
                             const wccp_wire_security_info *security, uint8_t *digest) {
@@ -266,12 +341,15 @@ static bool passes_security(wccp_service_group *group, const wccp_pkt *pkt,
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed mismatch security opt: %d configured opt: %d",
                       group->id, static_cast<int>(option), static_cast<int>(group->security_option));
         group->rx_auth_mismatches++;
+        wccp_note_reason(group, option == 0 ? WCCP_REASON_SECURITY_MISSING : WCCP_REASON_SECURITY_UNWANTED,
+                         pkt->ipa, security_text(option), security_text(group->security_option));
         return false;
     }
     if (option == 1 && !digest_is_right(group, pkt, digest)) {
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed authentication failed. Sender's source IP: %s",
                       group->id, addr_text(pkt->ipa).s);
         group->rx_auth_failures++;
+        wccp_note_reason(group, WCCP_REASON_PASSWORD_MISMATCH, pkt->ipa, {}, {});
         return false;
     }
     return true;
@@ -289,17 +367,25 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
             LC_LOG_ERR,
             "WCCP: message header length (%d) and actual packet length (%d) do not match. sender ip: %s",
             to_host(header->length), static_cast<int>(pkt->length), addr_text(pkt->ipa).s);
+        wccp_note_reason(nullptr, WCCP_REASON_MESSAGE_LENGTH, pkt->ipa,
+                         wccp_reason_value("%u bytes in its header", told),
+                         wccp_reason_value("%u bytes received", pkt->length));
         return 0;
     }
     if (to_host(header->version) != WCCP_VERSION) {
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP rxed verion (%d) is not supported. sender ip: %s",
                       to_host(header->version), addr_text(pkt->ipa).s);
+        wccp_note_reason(nullptr, WCCP_REASON_MESSAGE_VERSION, pkt->ipa,
+                         wccp_reason_value("0x%x", to_host(header->version)),
+                         wccp_reason_value("0x%x", WCCP_VERSION));
         return 0;
     }
     const uint32_t type = to_host(header->type);
     if (type != WCCP_I_SEE_YOU && type != WCCP_REMOVAL_QUERY) {
         QV_LOG(LC_LOG_INFO, "WCCP: message type (%u) is not for an appliance. sender ip: %s", type,
                addr_text(pkt->ipa).s);
+        wccp_note_reason(nullptr, WCCP_REASON_MESSAGE_TYPE, pkt->ipa, wccp_reason_value("type %u", type),
+                         wccp_reason_value("%u or %u", WCCP_I_SEE_YOU, WCCP_REMOVAL_QUERY));
         return 0;
     }
     const wccp_wire_security_info *security;
@@ -317,15 +403,19 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
     if (!group) {
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed service group (%d) is not configured.",
                       service->service_id, service->service_id);
+        wccp_note_reason(nullptr, WCCP_REASON_GROUP_UNKNOWN, pkt->ipa,
+                         wccp_reason_value("group %d", service->service_id), {});
         return refuse(pkt);
     }
     if (group->admin_state != WCCP_ADMIN_UP) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: is disabled. dropping the rxed packet.", group->id);
+        wccp_note_reason(group, WCCP_REASON_GROUP_DISABLED, pkt->ipa, {}, {});
         return 0;
     }
     // Queued in the socket, or held by the receive thread, while the group was stopped.
     if (!wccp_group_is_running(group)) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: is not running. dropping the rxed packet.", group->id);
+        wccp_note_reason(group, WCCP_REASON_GROUP_STOPPED, pkt->ipa, {}, {});
         return 0;
     }
     if (!passes_security(group, pkt, security, digest)) {
@@ -419,14 +509,18 @@ const build_step redirect_assign_steps[] = {
 };
 
 template <size_t Count>
-int run_steps(const build_step (&steps)[Count], wccp_service_group *group, wccp_pkt *pkt) {
+int run_steps(const build_step (&steps)[Count], wccp_reason_code reason, wccp_service_group *group,
+              wccp_pkt *pkt) {
     message_build build = {group, pkt, nullptr};
     for (const build_step &step : steps) {
         if (step.wanted && !step.wanted(group))
             continue;
-        if (const int status = step.load(&build))
+        if (const int status = step.load(&build)) {
+            wccp_note_reason(group, reason, {}, wccp_reason_value("%s", step.words), {});
             return failed(step.words, status);
+        }
     }
+    wccp_forget_reason(group, reason, {});
     return 0;
 }
 
@@ -460,11 +554,11 @@ void clear_packet(wccp_pkt *pkt) {
 } // namespace
 
 int wccp_pkt_build_here_i_am(wccp_service_group *group, wccp_pkt *pkt) {
-    return run_steps(here_i_am_steps, group, pkt);
+    return run_steps(here_i_am_steps, WCCP_REASON_HERE_I_AM_NOT_BUILT, group, pkt);
 }
 
 int wccp_pkt_build_redirect_assign(wccp_service_group *group, wccp_pkt *pkt) {
-    return run_steps(redirect_assign_steps, group, pkt);
+    return run_steps(redirect_assign_steps, WCCP_REASON_TABLE_NOT_BUILT, group, pkt);
 }
 
 int wccp_transmit_packet(wccp_service_group *group, wccp_pkt *pkt, uint32_t number) {

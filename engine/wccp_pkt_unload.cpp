@@ -3,7 +3,7 @@
 // A packet lies in the buffer of the receive thread that took it from the socket; that thread holds the
 // engine lock from here to the end of the packet's processing. Nothing is copied except the fixed fields of a
 // result, and nothing is allocated: the rest of a result points into the packet and is good until the thread
-// receives again. No group changes here, apart from one counter of unknown capabilities.
+// receives again. No group changes here, apart from its reasons and one counter of unknown capabilities.
 //
 // Any message may be hostile, so there is one way to its bytes: look<T>() gives a layout at a distance after
 // the cursor if all of it was received, and null otherwise. A test that has a log line of its own comes
@@ -17,6 +17,7 @@
 // failed.
 #include "engine/wccp_pkt_unload.h"
 
+#include <cinttypes>
 #include <climits>
 #include <iterator>
 
@@ -61,6 +62,23 @@ int pass(wccp_pkt *pkt, uint64_t size) {
     return 0;
 }
 
+// Notes why a message is refused, with what it has and what it should have; gives 1.
+int refuse(wccp_service_group *group, const wccp_pkt *pkt, const wccp_reason_text &has,
+           const wccp_reason_text &should_have, wccp_reason_code code = WCCP_REASON_MESSAGE_MALFORMED) {
+    wccp_note_reason(group, code, pkt->ipa, has, should_have);
+    return 1;
+}
+// The same of a component that does not fit, or whose own length is another than it should be.
+int refuse_size(wccp_service_group *group, const wccp_pkt *pkt, const char *what, uint64_t size,
+                uint64_t should_be) {
+    return refuse(group, pkt, wccp_reason_value("%s of %" PRIu64 " bytes", what, size),
+                  wccp_reason_value("%" PRIu64 " bytes", should_be));
+}
+int refuse_type(wccp_service_group *group, const wccp_pkt *pkt, uint32_t type, uint32_t should_be) {
+    return refuse(group, pkt, wccp_reason_value("component type %u", type),
+                  wccp_reason_value("type %u", should_be));
+}
+
 // A size as an argument for the %d of a log line.
 int shown(uint64_t size) {
     return size < INT_MAX ? static_cast<int>(size) : INT_MAX;
@@ -72,7 +90,8 @@ int shown(uint64_t size) {
 
 int wccp_pkt_unload_msg_header(wccp_pkt *pkt, const wccp_wire_msg_header **out) {
     *out = look<wccp_wire_msg_header>(pkt);
-    return *out ? pass(pkt, sizeof **out) : 1;
+    return *out ? pass(pkt, sizeof **out)
+                : refuse_size(nullptr, pkt, "a header", remaining(pkt), sizeof **out);
 }
 
 int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_security_info **out,
@@ -81,18 +100,19 @@ int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_secur
     *out_digest = nullptr;
     const auto *info = look<wccp_wire_security_info>(pkt);
     if (!info)
-        return 1;
+        return refuse_size(nullptr, pkt, "a security info", remaining(pkt), sizeof *info);
     const bool digested = to_host(info->option) == 1;
     const uint32_t size = digested ? sizeof(wccp_wire_security_md5) : sizeof(wccp_wire_security_info);
     if (to_host(info->head.type) != WCCP_SECURITY_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: expected security componenet. rxed %d", to_host(info->head.type));
-        return 1;
+        return refuse_type(nullptr, pkt, to_host(info->head.type), WCCP_SECURITY_INFO);
     }
     if (to_host(info->head.length) > size - sizeof info->head)
-        return 1;
+        return refuse_size(nullptr, pkt, "a security info", to_host(info->head.length),
+                           size - sizeof info->head);
     uint8_t *const digest = pkt->data + pkt->offset + offsetof(wccp_wire_security_md5, digest);
     if (pass(pkt, size))
-        return 1;
+        return refuse_size(nullptr, pkt, "a security info", remaining(pkt), size);
     *out = info;
     *out_digest = digested ? digest : nullptr;
     return 0;
@@ -102,14 +122,15 @@ int wccp_pkt_unload_service_info_component(wccp_pkt *pkt, const wccp_wire_servic
     *out = nullptr;
     const auto *info = look<wccp_wire_service_info>(pkt);
     if (!info)
-        return 1;
+        return refuse_size(nullptr, pkt, "a service info", remaining(pkt), sizeof *info);
     if (to_host(info->head.type) != WCCP_SERVICE_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: expected service info componenet. rxed %d",
                       to_host(info->head.type));
-        return 1;
+        return refuse_type(nullptr, pkt, to_host(info->head.type), WCCP_SERVICE_INFO);
     }
     if (to_host(info->head.length) != sizeof *info - sizeof info->head)
-        return 1;
+        return refuse_size(nullptr, pkt, "a service info", to_host(info->head.length),
+                           sizeof *info - sizeof info->head);
     *out = info;
     return pass(pkt, sizeof *info);
 }
@@ -123,22 +144,23 @@ int wccp_pkt_unload_router_identity_info_component(wccp_service_group *group, wc
     if (!identity) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: static length (%d) is longer than remaining pkt len (%d)",
                       group->id, shown(sizeof *identity), shown(remaining(pkt)));
-        return 1;
+        return refuse_size(group, pkt, "a router identity", remaining(pkt), sizeof *identity);
     }
     if (to_host(identity->head.type) != WCCP_ROUTER_IDENTITY_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: expecting router id info, rxed %d", group->id,
                       to_host(identity->head.type));
-        return 1;
+        return refuse_type(group, pkt, to_host(identity->head.type), WCCP_ROUTER_IDENTITY_INFO);
     }
     const uint64_t size = sizeof *identity + uint64_t{to_host(identity->received_from)} * sizeof(be32);
     if (size > remaining(pkt)) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: full length does not fit in pkt", group->id);
-        return 1;
+        return refuse_size(group, pkt, "a router identity", remaining(pkt), size);
     }
     if (to_host(identity->head.length) != size - sizeof identity->head) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: rxed length (%d) and expected length (%d) mismatch",
                       group->id, to_host(identity->head.length), shown(size - sizeof identity->head));
-        return 1;
+        return refuse_size(group, pkt, "a router identity", to_host(identity->head.length),
+                           size - sizeof identity->head);
     }
     *out = identity;
     return pass(pkt, size);
@@ -181,22 +203,24 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
     const auto *view = look<wccp_wire_router_view>(pkt);
     if (!view) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: static component does not fit in pkt", group->id);
-        return 1;
+        return refuse_size(group, pkt, "a router view", remaining(pkt), sizeof *view);
     }
     if (to_host(view->head.type) != WCCP_ROUTER_VIEW_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: bad router view type rxed (%d)", to_host(view->head.type));
-        return 1;
+        return refuse_type(group, pkt, to_host(view->head.type), WCCP_ROUTER_VIEW_INFO);
     }
     const uint32_t routers = to_host(view->routers);
     if (routers > WCCP_MAX_ROUTERS) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad number of routers (%d) in ICU pkt. ", group->id,
                       static_cast<int>(routers));
-        return 1;
+        return refuse(group, pkt, wccp_reason_value("%u routers", routers),
+                      wccp_reason_value("%u at most", WCCP_MAX_ROUTERS));
     }
     const auto *addresses = look<be32>(pkt, sizeof *view, routers);
     if (!addresses) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: number of routers does not fit in pkt", group->id);
-        return 1;
+        return refuse_size(group, pkt, "a router view", remaining(pkt),
+                           sizeof *view + routers * sizeof *addresses);
     }
     const uint32_t elements_at = static_cast<uint32_t>(sizeof *view + (routers + 1) * sizeof(be32));
     // Where the count was cut off there are no appliances; the view then doesn't fit, because the count
@@ -206,21 +230,25 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
     if (appliances > WCCP_MAX_APPLIANCES) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad number of appliances (%d) in ICU pkt.", group->id,
                       static_cast<int>(appliances));
-        return 1;
+        return refuse(group, pkt, wccp_reason_value("%u appliances", appliances),
+                      wccp_reason_value("%u at most", WCCP_MAX_APPLIANCES));
     }
     uint64_t size;
     if (!measure_view(group, pkt, elements_at, appliances, &size)) {
         WCCP_COMPLAIN(LC_LOG_ERR,
                       "WCCP GRP %d: # of appliances (%u x %d bytes) does not fit in pkt length (%u)",
                       group->id, appliances, shown(sizeof(wccp_wire_view_element_hash)), pkt->offset);
-        return 1;
+        return refuse(group, pkt, wccp_reason_value("%u bytes for %u appliances", remaining(pkt), appliances),
+                      {}, WCCP_REASON_VIEW_LENGTH);
     }
     if (to_host(view->head.length) != size - sizeof view->head) {
         WCCP_COMPLAIN(
             LC_LOG_ERR,
             "WCCP GRP %d: bad length. rxed length %d pkt length %d (check compatibility mode (IOS/Nexus))",
             group->id, to_host(view->head.length), shown(size - sizeof view->head));
-        return 1;
+        return refuse(group, pkt, wccp_reason_value("%u bytes", to_host(view->head.length)),
+                      wccp_reason_value("%d bytes", shown(size - sizeof view->head)),
+                      WCCP_REASON_VIEW_LENGTH);
     }
     *out = {
         .change_number = view->change_number,
@@ -283,6 +311,7 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
             return 1;
         }
         decoded->weight = to_host(*weight);
+        out_hash->mask_forms |= by_hash ? 0 : 1u << i;
         if (shape.form == WCCP_ELEMENT_REDIRECT) {
             out_hash->valid = 0; // the assignment comes as a map
         } else if (by_hash && flags & WCCP_IDENTITY_HISTORICAL) {
@@ -314,7 +343,7 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
             "WCCP GRP %d: minimum assignment map (len = %d) does not fit in the packet. router src ip : "
             "%s ",
             group->id, shown(smallest), addr_text(pkt->ipa).s);
-        return 1;
+        return refuse_size(group, pkt, "an assignment map", remaining(pkt), smallest);
     }
     const uint32_t declared = to_host(map->head.length);
     if (declared < smallest - head) {
@@ -322,7 +351,7 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
                       "WCCP GRP %d:  assignment map length: %d does not include at least one mask/value set "
                       "(expected minimum len: %d)  router src ip : %s ",
                       group->id, shown(declared), shown(smallest - head), addr_text(pkt->ipa).s);
-        return 1;
+        return refuse_size(group, pkt, "an assignment map", declared, smallest - head);
     }
     *out = {}; // a message may have two maps, and the last one counts
     out->element_count = to_host(map->mask_elements);
@@ -339,7 +368,7 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
                 "WCCP GRP %d: unload assignment map: packet length is BAD or it has bogus values. rxed "
                 "len: %d current len %d.",
                 group->id, shown(declared), shown(size - head));
-            return 1;
+            return refuse_size(group, pkt, "an assignment map", declared, size - head);
         }
         out->value_count = static_cast<uint32_t>(values);
         out->values = look<wccp_wire_value_element>(pkt, values_at, values);
@@ -362,7 +391,7 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
     constexpr uint32_t element_size = sizeof(wccp_wire_capability_element);
     const auto *head = look<wccp_wire_component>(pkt);
     if (!head)
-        return 1;
+        return refuse_size(group, pkt, "a capability info", remaining(pkt), sizeof *head);
     const uint32_t length = to_host(head->length);
     if (length % element_size != 0) {
         WCCP_COMPLAIN(
@@ -370,14 +399,15 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
             "WCCP GRP %d: capability component length is not aligned. length %d individual element size "
             "%d",
             group->id, shown(length), shown(element_size));
-        return 1;
+        return refuse(group, pkt, wccp_reason_value("a capability info of %u bytes", length),
+                      wccp_reason_value("a multiple of %u", element_size));
     }
     if (length >= (std::size(known) + 1) * element_size)
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: more capabilities than are known. length %d", group->id,
                shown(length));
     const auto *element = look<wccp_wire_capability_element>(pkt, sizeof *head, length / element_size);
     if (!element)
-        return 1;
+        return refuse_size(group, pkt, "a capability info", remaining(pkt), sizeof *head + length);
     for (uint32_t i = 0; i < length / element_size; i++, element++) {
         const capability *found = nullptr;
         for (const capability &each : known)
@@ -396,13 +426,13 @@ int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *p
     const auto *extension = look<wccp_wire_command_ext>(pkt);
     if (!extension) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: no commands in pkt", group->id);
-        return 1;
+        return refuse_size(group, pkt, "a command", remaining(pkt), sizeof *extension);
     }
     const uint32_t length = to_host(extension->head.length);
     if (pass(pkt, sizeof extension->head + length)) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bogus component length (%d): does not  fit in the packet.",
                       group->id, shown(length));
-        return 1;
+        return refuse_size(group, pkt, "a command", remaining(pkt), sizeof extension->head + length);
     }
     out->command = to_host(extension->command);
     out->data = to_host(extension->data);
@@ -422,7 +452,8 @@ int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt) 
     WCCP_COMPLAIN(LC_LOG_ERR,
                   "WCCP GRP %d: unkown pkt length does not fit in the packet. component type: %d length %d ",
                   group->id, type, length);
-    return 1;
+    return refuse(group, pkt, wccp_reason_value("component type %d of %d bytes", type, length),
+                  wccp_reason_value("%u bytes", remaining(pkt)));
 }
 
 // The one component of a Removal Query.
@@ -434,17 +465,17 @@ int wccp_pkt_unload_router_query_component(wccp_service_group *group, wccp_pkt *
     const auto *query = look<wccp_wire_router_query>(pkt);
     if (!query) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: router query comp. does not fit in packet.", group->id);
-        return 1;
+        return refuse_size(group, pkt, "a router query", remaining(pkt), sizeof *query);
     }
     if (to_host(query->head.type) != WCCP_ROUTER_QUERY_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad router query type rxed (%d)", group->id,
                       to_host(query->head.type));
-        return 1;
+        return refuse_type(group, pkt, to_host(query->head.type), WCCP_ROUTER_QUERY_INFO);
     }
     if (to_host(query->head.length) != length) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad length. rxed length %d pkt length %d", group->id,
                       to_host(query->head.length), shown(length));
-        return 1;
+        return refuse_size(group, pkt, "a router query", to_host(query->head.length), length);
     }
     *out = query;
     return pass(pkt, sizeof *query);

@@ -1,6 +1,6 @@
 // The reader's side of the wire format: it checks, moves the cursor and hands out pointers into the packet,
 // which are valid until the next receive. All of it returns 0, or 1 for what it refuses, and changes nothing
-// in a group but rx_unknown_capabilities. Lock held.
+// in a group but rx_unknown_capabilities and the reasons. Lock held.
 #pragma once
 
 #include "engine/wccp_records.h"
@@ -39,9 +39,10 @@ struct wccp_command_info {
 
 // What one router assigns to this appliance.
 struct wccp_assign_summary {
-    uint32_t valid;       // 1: this summary is the one to use
-    uint16_t self_count;  // buckets or values that the router gives to this appliance
-    uint16_t total_count; // buckets or values that it gives to anybody
+    uint32_t valid;          // 1: this summary is the one to use
+    uint16_t self_count;     // buckets or values that the router gives to this appliance
+    uint16_t total_count;    // buckets or values that it gives to anybody
+    uint32_t mask_forms = 0; // of the hash summary: bit i is set when element i has a form of the mask method
 };
 
 // Which of its forms a web-cache element of a Router View has: its flags and the group's compatibility mode

@@ -4,6 +4,8 @@
 
 #include "engine/wccp_query.h"
 
+#include <cstring>
+
 #include "engine/wccp_utils.h"
 #include "runtime/common.h"
 #include "runtime/logging.h"
@@ -61,6 +63,8 @@ int wccp_get_grp_info(int id, wccp_grp_info *info) {
     info->num_routers = group->sending_router_count;
     info->num_appliances = group->appliance_view_count;
     info->num_view_routers = group->router_view_count;
+    info->since = wccp_g.seconds - group->start_time;
+    info->pending_acks = group->pending_acks;
     const bool timed = (group->state_flags & (WCCP_STATE_ACTIVE | WCCP_STATE_BACKUP)) != 0;
     info->uptime = timed ? wccp_g.seconds - group->state_time : 0;
     put_text(info->oper, state_words[group->state_flags & WCCP_STATE_MASK]);
@@ -85,6 +89,7 @@ int wccp_get_grp_router_info(int id, wccp_grp_router_info *info) {
     info->router_id = router->router_id;
     info->src_ipa = router->src_ipa;
     info->conn_time = wccp_g.seconds - router->state_time;
+    info->heard = wccp_g.seconds - router->last_icu_time;
     const bool agreed = (group->state_flags & WCCP_CAPABILITIES_SET) != 0;
     put_text(info->fwd, agreed ? word_of(method_words, group->fwd_method) : "not-set");
     put_text(info->ret, agreed ? word_of(method_words, group->ret_method) : "not-set");
@@ -170,4 +175,103 @@ int wccp_get_router_appliance_info(wccp_router_appliance_info *info) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find appliance: appliance id %s not present in router %d", id,
            addr_text(info->ipa).s, static_cast<int>(info->router_num));
     return 1;
+}
+
+// Reasons and counters.
+
+// False when there is no such group; null, and true, for WCCP_NO_GROUP.
+static bool find_reason_owner(int id, wccp_service_group **out) {
+    *out = id == WCCP_NO_GROUP ? nullptr : wccp_find_group(id);
+    return *out || id == WCCP_NO_GROUP;
+}
+
+int wccp_get_reason_list(int id, wccp_reason_list *list) {
+    if (!list)
+        return 1;
+    const wccp_engine_lock lock;
+    wccp_service_group *group;
+    if (!find_reason_owner(id, &group))
+        return 1;
+    uint32_t places;
+    const wccp_reason *const table = wccp_reasons_of(group, &places);
+    list->count = 0;
+    for (uint32_t i = 0; i < places; i++)
+        if (table[i].code != WCCP_REASON_NONE)
+            list->places[list->count++] = static_cast<uint8_t>(i + 1);
+    return 0;
+}
+
+int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info) {
+    if (!info)
+        return 1;
+    const wccp_engine_lock lock;
+    wccp_service_group *group;
+    if (!find_reason_owner(id, &group))
+        return 1;
+    uint32_t places;
+    const wccp_reason *const table = wccp_reasons_of(group, &places);
+    *info = {};
+    if (place < 1 || place > places || table[place - 1].code == WCCP_REASON_NONE)
+        return 0;
+    info->reason = table[place - 1];
+    info->first_before = wccp_g.seconds - info->reason.first;
+    info->last_before = wccp_g.seconds - info->reason.last;
+    return 0;
+}
+
+static constexpr struct {
+    const char *word;
+    uint32_t wccp_service_group::*member;
+} counter_rows[] = {
+    {"rx_icus", &wccp_service_group::rx_icus},
+    {"rx_icu_failures", &wccp_service_group::rx_icu_failures},
+    {"rx_removal_queries", &wccp_service_group::rx_removal_queries},
+    {"rx_removal_failures", &wccp_service_group::rx_removal_failures},
+    {"rx_failures", &wccp_service_group::rx_failures},
+    {"rx_auth_failures", &wccp_service_group::rx_auth_failures},
+    {"rx_auth_mismatches", &wccp_service_group::rx_auth_mismatches},
+    {"rx_service_mismatches", &wccp_service_group::rx_service_mismatches},
+    {"rx_unknown_capabilities", &wccp_service_group::rx_unknown_capabilities},
+    {"tx_here_i_am", &wccp_service_group::tx_here_i_am},
+    {"tx_redirect_assign", &wccp_service_group::tx_redirect_assign},
+    {"tx_removal_replies", &wccp_service_group::tx_removal_replies},
+    {"tx_failures", &wccp_service_group::tx_failures},
+    {"tx_build_failures", &wccp_service_group::tx_build_failures},
+    {"tx_link_drops", &wccp_service_group::tx_link_drops},
+    {"routers_timed_out", &wccp_service_group::routers_timed_out},
+    {"transitions", &wccp_service_group::transitions},
+};
+
+const char *wccp_counter_word(uint32_t index) {
+    return index < sizeof counter_rows / sizeof *counter_rows ? counter_rows[index].word : nullptr;
+}
+
+int wccp_get_counter(int id, const char *word, uint32_t *out) {
+    if (!word || !out)
+        return 1;
+    const wccp_engine_lock lock;
+    const wccp_service_group *group = wccp_find_group(id);
+    for (const auto &row : counter_rows)
+        if (group && strcmp(row.word, word) == 0) {
+            *out = group->*row.member;
+            return 0;
+        }
+    return 1;
+}
+
+int wccp_get_interface_info(uint32_t index, wccp_interface_info *info) {
+    if (!info)
+        return 1;
+    const wccp_engine_lock lock;
+    if (index >= wccp_g.if_count)
+        return 1;
+    const wccp_interface *from = &wccp_g.interfaces[index];
+    put_text(info->name, from->name);
+    info->ipa = from->ipa;
+    info->link_up = from->link_up;
+    info->starts = from->start_count;
+    info->stops = from->stop_count;
+    info->link_downs = from->link_down_count;
+    info->address_changes = from->ipa_change_count;
+    return 0;
 }

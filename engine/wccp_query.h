@@ -18,6 +18,8 @@ struct wccp_grp_info {
     uint32_t num_appliances;
     uint32_t num_view_routers;
     uint32_t uptime; // seconds
+    uint32_t since;  // seconds since it was started or stopped
+    uint32_t pending_acks;
     char oper[128];
 };
 struct wccp_grp_router_info {
@@ -25,6 +27,7 @@ struct wccp_grp_router_info {
     be32 router_id;
     be32 src_ipa;
     uint32_t conn_time; // seconds
+    uint32_t heard;     // seconds since its last I-See-You
     char fwd[8];
     char ret[8];
     char assign[8];
@@ -52,6 +55,30 @@ struct wccp_router_appliance_info {
     be32 ipa;            // in
     uint32_t load_percent;
 };
+
+// Why something does not work (wccp_reasons.h). Places count from 1, and a reason keeps its place.
+constexpr int WCCP_NO_GROUP = -1; // as an id: of packets of no group
+struct wccp_reason_list {
+    uint32_t count;
+    uint8_t places[WCCP_GROUP_REASONS];
+};
+struct wccp_reason_info {
+    wccp_reason reason;                 // of code NONE when there is none
+    uint32_t first_before, last_before; // seconds
+};
+struct wccp_interface_info {
+    char name[WCCP_IF_NAME_BYTES];
+    be32 ipa;
+    uint32_t link_up, starts, stops, link_downs, address_changes;
+};
+
+int wccp_get_reason_list(int id, wccp_reason_list *list);
+int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info);
+// The word of a counter, by its place in their table from 0; null past the last.
+const char *wccp_counter_word(uint32_t index);
+int wccp_get_counter(int id, const char *word, uint32_t *out); // also 1 for a word that is none
+// By its place from 0; 1 past the last.
+int wccp_get_interface_info(uint32_t index, wccp_interface_info *info);
 
 int wccp_get_grp_list(wccp_grp_list *list);
 int wccp_get_grp_info(int id, wccp_grp_info *info);

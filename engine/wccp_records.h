@@ -15,6 +15,7 @@
 #include <cstddef>
 #include <cstdint>
 
+#include "engine/wccp_reasons.h"
 #include "runtime/byte_order.h"
 
 constexpr uint32_t WCCP_MAX_GROUPS = 256;
@@ -103,6 +104,7 @@ struct wccp_interface {
     be32 mcast_bound_ipa;   // what mcast_fd is bound to
     uint32_t network_flaws; // what the last socket set-up could not do
     uint32_t network_tried; // wccp_g.seconds of the last attempt
+    int32_t network_error;  // errno of the last set-up or join that failed
 };
 enum : uint32_t { WCCP_FLAW_SOCKETS = 1, WCCP_FLAW_JOIN = 2 }; // network_flaws
 
@@ -265,6 +267,8 @@ struct wccp_service_group {
     uint32_t rx_auth_failures;
     uint32_t rx_auth_mismatches;
     uint32_t rx_service_mismatches;
+    uint32_t start_time; // when it was started, or stopped, last
+    wccp_reason reasons[WCCP_GROUP_REASONS];
 };
 
 struct wccp_global {
@@ -282,6 +286,7 @@ struct wccp_global {
     std::atomic<uint32_t> stat_frees;
     std::atomic<uint32_t> stat_alloc_fails;
     uint32_t rx_failures;
+    wccp_reason reasons[WCCP_OTHER_REASONS]; // of packets of no group
 };
 extern wccp_global wccp_g;
 

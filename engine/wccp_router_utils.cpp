@@ -54,11 +54,13 @@ namespace {
 using capabilities = wccp_rtr_capabilities;
 
 // One of the three methods to agree on: its member, which code wins when both sides can do either, and
-// what is said and returned when they have none in common.
+// what is logged, noted and returned when they have none in common.
 struct capability_step {
     uint32_t capabilities::*word;
     uint32_t (*preferred)(const capabilities *agreed);
     int refusal;
+    wccp_reason_code reason;
+    const char *(*name)(uint32_t code);
     void (*complain)(int group, be32 router_id, const capabilities *local, const capabilities *offered);
 };
 
@@ -69,6 +71,7 @@ uint32_t offered_code(uint32_t word) {
 
 const capability_step capability_steps[] = {
     {&capabilities::forwarding, [](const capabilities *) -> uint32_t { return WCCP_METHOD_L2; }, 0,
+     WCCP_REASON_FORWARDING_NOT_OFFERED, wccp_method_name,
      [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
          WCCP_COMPLAIN(
              LC_LOG_WARNING,
@@ -83,7 +86,7 @@ const capability_step capability_steps[] = {
      [](const capabilities *agreed) -> uint32_t {
          return agreed->forwarding == WCCP_METHOD_L2 ? WCCP_ASSIGN_MASK : WCCP_ASSIGN_HASH;
      },
-     0,
+     0, WCCP_REASON_ASSIGNMENT_NOT_OFFERED, wccp_assign_method_name,
      [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
          WCCP_COMPLAIN(
              LC_LOG_WARNING,
@@ -93,6 +96,7 @@ const capability_step capability_steps[] = {
              wccp_assign_method_name(offered_code(offered->assignment)));
      }},
     {&capabilities::ret, [](const capabilities *) -> uint32_t { return WCCP_METHOD_GRE; }, 1,
+     WCCP_REASON_RETURN_NOT_OFFERED, wccp_method_name,
      [](int group, be32 router_id, const capabilities *local, const capabilities *offered) {
          WCCP_COMPLAIN(
              LC_LOG_WARNING,
@@ -126,6 +130,9 @@ int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,
         agreed.*step.word = common_code(local->*step.word, offered->*step.word, step.preferred(&agreed));
         if (agreed.*step.word == WCCP_METHOD_NONE) {
             step.complain(group->id, router_id, local, offered);
+            wccp_note_reason(group, step.reason, router_id,
+                             wccp_reason_value("%s", step.name(offered_code(offered->*step.word))),
+                             wccp_reason_value("%s", step.name(local->*step.word)));
             return step.refusal;
         }
     }
@@ -139,11 +146,14 @@ wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 
                                                 const wccp_rtr_capabilities *agreed) {
     if (is_zero(router_id)) {
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: invalid router id in ICU. 0.0.0.0", group->id);
+        wccp_note_reason(group, WCCP_REASON_ROUTER_ID_ZERO, {}, {}, {});
         return nullptr;
     }
     if (group->sending_router_count >= WCCP_MAX_ROUTERS) {
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: Router Maximum (%d) reached", group->id,
                       static_cast<int>(WCCP_MAX_ROUTERS));
+        wccp_note_reason(group, WCCP_REASON_ROUTERS_EXHAUSTED, router_id, {},
+                         wccp_reason_value("%u routers at most", WCCP_MAX_ROUTERS));
         return nullptr;
     }
     owned<wccp_sending_router, free_router> made(
@@ -151,6 +161,7 @@ wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 
     if (!made.pointer) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: sending router creation failed. router id %s ", group->id,
                addr_text(router_id).s);
+        wccp_note_reason(group, WCCP_REASON_NO_MEMORY, router_id, wccp_reason_value("its record"), {});
         return nullptr;
     }
     uint32_t flags = WCCP_RTR_ONE_WAY;
@@ -242,9 +253,12 @@ int wccp_monitor_sending_routers(wccp_service_group *group) {
         next = router->next;
         if (wccp_g.seconds - router->last_icu_time < SILENCE_LIMIT)
             continue;
+        const be32 id = router->router_id;
         remove_silent_router(group, router);
         wccp_alarm_raise_router_down_alarm(group);
         group->routers_timed_out++;
+        wccp_note_reason(group, WCCP_REASON_ROUTER_SILENT, id, {},
+                         wccp_reason_value("an I-See-You within %u s", SILENCE_LIMIT));
     }
     return 0;
 }
@@ -263,6 +277,8 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
     if (!router) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removal query request. cannot find router. (router id %s)",
                group->id, addr_text(router_id).s);
+        wccp_note_reason(group, WCCP_REASON_QUERY_REFUSED, router_id,
+                         wccp_reason_value("a query before an I-See-You"), {});
         return 0;
     }
     if (!(router->flags & WCCP_RTR_TWO_WAY)) {
@@ -270,6 +286,8 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
                "WCCP GRP %d: removal query request. router (router id %s) is not 2-way connected. igoring "
                "request",
                group->id, addr_text(router_id).s);
+        wccp_note_reason(group, WCCP_REASON_QUERY_REFUSED, router_id,
+                         wccp_reason_value("a query of a one-way router"), {});
         return 0;
     }
     router->receive_id = receive_id;
@@ -277,6 +295,8 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
         QV_LOG(LC_LOG_INFO,
                "WCCP GRP %d: removal query request. maximum of waiting replies (%d) reached. (router id %s)",
                group->id, static_cast<int>(MAX_REPLIES_WAITING), addr_text(router_id).s);
+        wccp_note_reason(group, WCCP_REASON_QUERY_REFUSED, router_id, wccp_reason_value("one more query"),
+                         wccp_reason_value("%u replies waiting at most", MAX_REPLIES_WAITING));
         return 1;
     }
     owned<wccp_removal_reply, free_reply> reply(
@@ -284,6 +304,8 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
     if (!reply.pointer) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removal query request. cannot allocate pkt to send. (router id %s)",
                group->id, addr_text(router_id).s);
+        wccp_note_reason(group, WCCP_REASON_NO_MEMORY, router_id, wccp_reason_value("a reply to its query"),
+                         {});
         return 1;
     }
     wccp_pkt *pkt = &reply.pointer->pkt;

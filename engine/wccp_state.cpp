@@ -89,6 +89,7 @@ int wccp_appliance_state_backup(wccp_service_group *group) {
 void wccp_clear_redirect_assign_states(wccp_service_group *group) {
     group->assign_timer.active = 0;
     group->pending_acks = 0;
+    wccp_forget_reasons(group, WCCP_REASON_NOT_ACKNOWLEDGED);
     for (wccp_sending_router *router = group->sending_routers; router; router = router->next) {
         router->flags &= ~WCCP_RTR_ASSIGN_UNACKED;
         router->assign_tx_count = 0;
@@ -108,9 +109,13 @@ static void collect_eligible_appliances(wccp_service_group *group, uint32_t *out
         }
         if (entry->listing == WCCP_LISTED_BY_ALL)
             entry->listing = WCCP_NOT_LISTED_BY_ALL;
+        wccp_note_reason(group, WCCP_REASON_APPLIANCE_LEFT_OUT, entry->ipa,
+                         wccp_reason_value("in %u views", entry->ref_count),
+                         wccp_reason_value("in those of all %u routers", group->sending_router_count));
         ++*out_left_out;
         *out_logged += entry->listing == WCCP_NOT_LISTED_LOGGED;
     }
+    wccp_forget_older_reasons(group, WCCP_REASON_APPLIANCE_LEFT_OUT);
 }
 
 // One I-See-You can bring 32 computations, and a thousand appliances can be left out of each. So an appliance
@@ -184,12 +189,18 @@ int wccp_update_designated_redirect_assignment(wccp_service_group *group, int re
 // The election.
 
 static bool every_router_is_two_way(wccp_service_group *group) {
+    bool all = true;
     for (const wccp_view_router *entry = group->router_view; entry; entry = entry->next) {
         const wccp_sending_router *router = wccp_find_sending_router(group, entry->ipa);
-        if (!router || !(router->flags & WCCP_RTR_TWO_WAY))
-            return false;
+        if (router && router->flags & WCCP_RTR_TWO_WAY)
+            continue;
+        all = false;
+        wccp_note_reason(group, WCCP_REASON_ELECTION_BLOCKED, entry->ipa,
+                         wccp_reason_value("%s", router ? "one-way" : "no I-See-You"),
+                         wccp_reason_value("two-way"));
     }
-    return true;
+    wccp_forget_older_reasons(group, WCCP_REASON_ELECTION_BLOCKED);
+    return all;
 }
 
 static bool has_lower_appliance(const wccp_service_group *group) {
@@ -205,6 +216,7 @@ static int wccp_elect_designated_appliance(wccp_service_group *group) {
     group->state_flags &= ~WCCP_DESG_ELECT_PENDING;
     const uint32_t was_designated = group->designated;
     group->designated = 0;
+    wccp_forget_reasons(group, WCCP_REASON_APPLIANCE_LEFT_OUT);
     wccp_clear_redirect_assign_states(group);
     wccp_alarm_schedule_verify_allocation_table_timer(group, 1);
     if (group->appliance_view_count == 0) {

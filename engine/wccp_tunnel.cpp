@@ -91,6 +91,13 @@ struct tunnel_removal {
     wccp_tunnel *tunnel;
 };
 
+// Of an add for the router of a group. Engine lock held.
+void note_failure(int group, wccp_reason_code code, be32 remote, const wccp_reason_text &offered,
+                  const wccp_reason_text &wanted) {
+    if (wccp_service_group *record = wccp_find_group(group))
+        wccp_note_reason(record, code, remote, offered, wanted);
+}
+
 } // namespace
 
 int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
@@ -105,16 +112,22 @@ int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
     owned<wccp_tunnel, free_tunnel> tunnel(static_cast<wccp_tunnel *>(wccp_calloc(1, sizeof(wccp_tunnel))));
     if (!tunnel.pointer) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: Failed to alloc tunnel memory", group);
+        note_failure(group, WCCP_REASON_NO_MEMORY, remote, wccp_reason_value("its tunnel"), {});
         return 1;
     }
     tunnel.pointer->dataplane_index = WCCP_NO_INDEX;
     owned_tunnel_id id;
     if (!id.take_lowest()) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: No free tunnel id available", group);
+        note_failure(group, WCCP_REASON_TUNNEL_IDS_EXHAUSTED, remote, {},
+                     wccp_reason_value("ids %u to %u", g_qv_encap_wccp_first, g_qv_encap_wccp_last));
         return 1;
     }
+    wccp_reason_code failure = WCCP_REASON_NONE;
     if (wccp_add_tunnel_encap(id.id, mailbox_address_of(local), mailbox_address_of(remote),
-                              &tunnel.pointer->dataplane_index) == 1) {
+                              &tunnel.pointer->dataplane_index, &failure) == 1) {
+        note_failure(group, failure, remote, wccp_reason_value("tunnel id %d", id.id),
+                     wccp_reason_value("from %s", addr_text(local).s));
         WCCP_COMPLAIN(LC_LOG_NOTICE, "WCCP GRP %d: failed to add tunnel: id: %d %s <=> %s", group, id.id,
                       addr_text(local).s, addr_text(remote).s);
         return 1;

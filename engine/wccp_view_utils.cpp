@@ -161,6 +161,7 @@ static bool hold_router(wccp_service_group *group, be32 address) {
         if (!entry) {
             QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding router view failed. out of memory. router ipa %s",
                    group->id, addr_text(address).s);
+            wccp_note_reason(group, WCCP_REASON_NO_MEMORY, address, wccp_reason_value("a router"), {});
             return false;
         }
         entry->ipa = address;
@@ -255,6 +256,8 @@ static bool hold_appliance(wccp_service_group *group, const wccp_rtr_view_applia
         if (!entry) {
             QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding appliance view failed. out of memory. appliance ipa %s",
                    group->id, addr_text(element->ipa).s);
+            wccp_note_reason(group, WCCP_REASON_NO_MEMORY, element->ipa, wccp_reason_value("an appliance"),
+                             {});
             return false;
         }
         entry->ipa = element->ipa;
@@ -457,8 +460,14 @@ int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sendin
         WCCP_COMPLAIN(LC_LOG_WARNING,
                       "WCCP GRP %d: update redirect status: assign. info not found. sender rtr id: %s",
                       group->id, addr_text(router->router_id).s);
+        wccp_note_reason(group, WCCP_REASON_ASSIGNMENT_UNREADABLE, router->router_id, {}, {});
         return 1;
     }
+    const uint32_t method = now == mask ? WCCP_ASSIGN_MASK : WCCP_ASSIGN_HASH;
+    if (now->total_count != 0 && method != group->assign_method)
+        wccp_note_reason(group, WCCP_REASON_METHOD_DIFFERS, router->router_id,
+                         wccp_reason_value("%s by the router", wccp_assign_method_name(method)),
+                         wccp_reason_value("%s", wccp_assign_method_name(group->assign_method)));
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: RX redirect status: rtr id: %s to self: %d/%d buckets (%s)", group->id,
            addr_text(router->router_id).s, now->self_count, now->total_count,
            now == mask ? "mask assign" : "hash assign");

@@ -199,16 +199,18 @@ wait_end wait_for_answer(wccp_tunnel_mailbox *mailbox, uint16_t code) {
 }
 
 // Gives the command and waits, unless it is refused. True when tunneld has answered; its answer is then in
-// the outputs.
+// the outputs. Otherwise `out_failure` says why not.
 bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_t *out_status,
-                  uint32_t *out_index) {
+                  uint32_t *out_index, wccp_reason_code *out_failure) {
     const mutex_guard guard(&mailbox_mutex);
     wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
+    *out_failure = WCCP_REASON_MAILBOX_MISSING;
     if (!mailbox)
         return false;
     const effort made = effort_for(kind->code, mailbox);
     if (made != effort::NONE)
         write_command(mailbox, kind->code, inputs);
+    *out_failure = made == effort::GIVE_AND_WAIT ? WCCP_REASON_TUNNEL_TIMEOUT : WCCP_REASON_TUNNELD_SILENT;
     wait_end end = wait_end::TIMED_OUT;
     if (made == effort::GIVE_AND_WAIT) {
         end = wait_for_answer(mailbox, kind->code);
@@ -238,10 +240,14 @@ mailbox_inputs tunnel_inputs(uint16_t tunnel_id, mailbox_address local, mailbox_
 } // namespace
 
 int wccp_add_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
-                          uint32_t *inout_index) {
+                          uint32_t *inout_index, wccp_reason_code *out_failure) {
     const mailbox_inputs inputs = tunnel_inputs(tunnel_id, local, remote, *inout_index);
     uint32_t status, index;
-    if (!give_command(&add_tunnel, &inputs, &status, &index))
+    wccp_reason_code failure;
+    const bool answered = give_command(&add_tunnel, &inputs, &status, &index, &failure);
+    if (out_failure)
+        *out_failure = answered ? WCCP_REASON_TUNNEL_REFUSED : failure;
+    if (!answered)
         return 1;
     *inout_index = index;
     return index == WCCP_NO_INDEX ? 1 : static_cast<int>(status);
@@ -251,7 +257,8 @@ int wccp_del_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_add
                           uint32_t *inout_index) {
     const mailbox_inputs inputs = tunnel_inputs(tunnel_id, local, remote, *inout_index);
     uint32_t status, index;
-    if (!give_command(&delete_tunnel, &inputs, &status, &index))
+    wccp_reason_code unused;
+    if (!give_command(&delete_tunnel, &inputs, &status, &index, &unused))
         return 1;
     *inout_index = index;
     return static_cast<int>(status);
@@ -262,7 +269,8 @@ int wccp_set_L2_return(uint8_t group_id, uint32_t value) {
     inputs.l2_group = group_id;
     inputs.l2_value = value;
     uint32_t status, index;
-    if (!give_command(&set_l2_return, &inputs, &status, &index))
+    wccp_reason_code unused;
+    if (!give_command(&set_l2_return, &inputs, &status, &index, &unused))
         return 1;
     return static_cast<int>(status);
 }

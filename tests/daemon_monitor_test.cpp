@@ -114,6 +114,8 @@ TEST_F(DaemonMonitor, RoutersAreCountedByTheirPlace) {
     wccp_sending_router *second = add_router(201);
     wccp_sending_router *first = add_router(202);
     first->state_time = wccp_g.seconds - 7;
+    first->last_icu_time = wccp_g.seconds - 3;
+    EXPECT_EQ(of_51("router/1/heard"), one(bn_type_duration_ms, "3000"));
     first->flags = WCCP_RTR_TWO_WAY;
     second->flags = WCCP_RTR_ONE_WAY;
     EXPECT_EQ(of_51("router/1/id"), one(bn_type_ipv4addr, "10.0.0.202"));
@@ -241,6 +243,52 @@ TEST_F(DaemonMonitor, TheTexts) {
     EXPECT_EQ(get(SYSTEM + "debug_all"), NOTHING);
     EXPECT_GE(said(".ERR]"), 1);
     EXPECT_TRUE(holds(get(SYSTEM + "debug_global"), "debug buffer: used"));
+}
+
+TEST_F(DaemonMonitor, ReasonsAndCounters) {
+    const auto note = [](wccp_service_group *of, wccp_reason_code code, uint32_t sender) {
+        wccp_note_reason(of, code, address(sender), wccp_reason_value("gre"), wccp_reason_value("L2"));
+    };
+    note(group, WCCP_REASON_PASSWORD_MISMATCH, 201);
+    note(group, WCCP_REASON_FORWARDING_NOT_OFFERED, 202);
+    note(nullptr, WCCP_REASON_GROUP_UNKNOWN, 203);
+    wccp_g.seconds += 5;
+    note(group, WCCP_REASON_FORWARDING_NOT_OFFERED, 202);
+    wccp_g.seconds += 2;
+    wccp_forget_reason(group, WCCP_REASON_PASSWORD_MISMATCH, address(201));
+    const std::string of_group = children(STATE + "/51/reason"),
+                      place = of_group.substr(0, of_group.find(' '));
+    EXPECT_EQ(place.size() + 1, of_group.size()) << "one reason, and it keeps its place: " << of_group;
+    const std::string at = "reason/" + place + "/";
+    EXPECT_EQ(of_51("reason/" + place), one(bn_type_str, place));
+    EXPECT_EQ(of_51(at + "code"), one(bn_type_str, "forwarding-not-offered"));
+    EXPECT_EQ(of_51(at + "sender"), one(bn_type_ipv4addr, "10.0.0.202"));
+    EXPECT_EQ(of_51(at + "offered"), one(bn_type_str, "gre"));
+    EXPECT_EQ(of_51(at + "wanted"), one(bn_type_str, "L2"));
+    EXPECT_EQ(of_51(at + "count"), one(bn_type_uint32, "2"));
+    EXPECT_EQ(of_51(at + "first"), one(bn_type_duration_ms, "7000"));
+    EXPECT_EQ(of_51(at + "last"), one(bn_type_duration_ms, "2000"));
+    EXPECT_EQ(children(SYSTEM + "reason"), "1 ");
+    EXPECT_EQ(get(SYSTEM + "reason/1/code"), one(bn_type_str, "group-unknown"));
+    for (const std::string gone : {"0", "40", "41", "4294967297", "x"})
+        EXPECT_EQ(of_51("reason/" + gone + "/code"), NOTHING);
+    EXPECT_EQ(children(STATE + "/7/reason"), "");
+
+    group->start_time = wccp_g.seconds - 9;
+    group->rx_icu_failures = 4294967295;
+    EXPECT_EQ(of_51("since"), one(bn_type_duration_ms, "9000"));
+    EXPECT_EQ(of_51("pending_acks"), one(bn_type_uint32, "0"));
+    EXPECT_EQ(of_51("counter/rx_icu_failures"), one(bn_type_uint32, "4294967295"));
+    EXPECT_EQ(of_51("counter/weight"), NOTHING);
+    for (const char *word : {"rx_icu_failures ", "rx_removal_failures ", "tx_build_failures ",
+                             "tx_link_drops ", "routers_timed_out "})
+        EXPECT_NE(children(STATE + "/51/counter").find(word), std::string::npos) << word;
+    engine.interface->link_down_count = 3;
+    EXPECT_EQ(children(SYSTEM + "interface"), "lan0 ");
+    EXPECT_EQ(get(SYSTEM + "interface/lan0/link_downs"), one(bn_type_uint32, "3"));
+    EXPECT_EQ(get(SYSTEM + "interface/lan0/address"), one(bn_type_ipv4addr, "10.0.0.1"));
+    EXPECT_EQ(get(SYSTEM + "interface/lan1/link_downs"), NOTHING);
+    EXPECT_EQ(said(".ERR]"), 0);
 }
 
 TEST_F(DaemonMonitor, WhatIsListed) {

@@ -31,6 +31,7 @@
 #include "runtime/common.h"
 #include "tests/support/engine_fixture.h"
 #include "tests/support/log_lines.h"
+#include "tests/support/reported_group.h"
 
 namespace {
 
@@ -236,6 +237,9 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
             log.take();
             EXPECT_EQ(wccp_add_group(&multicast), 1);
             EXPECT_EQ(count_of("WCCP: net init", log.take()), 0u) << "not twice in one second";
+            EXPECT_EQ(take_reasons(wccp_find_group(62)), &cause == causes
+                                                             ? "port-taken: Address already in use|wan0"
+                                                             : "socket-failed: Too many open files|wan0");
             occasion.happens();
             EXPECT_EQ(wan->ucast_bound, 0u);
             cause(false);
@@ -249,6 +253,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
                       1u);
             // A group that could not join is started, and somebody receives.
             EXPECT_EQ(wccp_find_group(62)->hia_timer.active, 1);
+            EXPECT_EQ(take_reasons(wccp_find_group(62)), "");
             EXPECT_EQ(wan->mcast_bound_ipa, ipa("224.0.1.62"));
             EXPECT_EQ(threads_named("WCCP_RX_wan0"), 1);
             EXPECT_EQ(wccp_del_group(62), 0);
@@ -276,6 +281,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
     run_command("echo 1 >/proc/sys/net/ipv4/igmp_max_memberships");
     wccp_grp_config other = engine_fixture::group_config(63, {"224.0.1.63"});
     EXPECT_EQ(wccp_add_group(&other), 1);
+    EXPECT_EQ(take_reasons(wccp_find_group(63)), "join-failed: No buffer space available|wan0");
     run_command("echo 20 >/proc/sys/net/ipv4/igmp_max_memberships");
     tick(30);
     EXPECT_EQ(wccp_find_group(63)->hia_timer.active, 1);
@@ -377,6 +383,13 @@ TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
     pkt.ipa = {};
     run_command("ip link set wan0 down");
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), -2);
+    const std::string fault = ": Network is unreachable|120 bytes";
+    EXPECT_EQ(take_reasons(&group), "send-failed 10.0.0.2" + fault + "; send-failed 10.0.0.3" + fault);
+    wccp_tx_pkt(&group, &pkt);
+    run_command("ip link set wan0 up");
+    pkt.ipa = ipa("10.0.0.2");
+    EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 120);
+    EXPECT_EQ(take_reasons(&group), "send-failed 10.0.0.3" + fault) << "sent: no reason any more";
 }
 
 // Addresses that nobody has: what is sent to them stays in the buffer while the kernel looks for them.
@@ -476,6 +489,10 @@ TEST_F(Network, TheTableGrowsToItsLimitAndKnowsNobodyTwice) {
     EXPECT_EQ(wccp_if_add_interface("absent1"), &wccp_g.interfaces[3]);
     EXPECT_EQ(wccp_g.primary_if, lo);
     wccp_grp_config config = engine_fixture::group_config(1, {});
+    strlcpy(config.interface, "absent1", sizeof config.interface);
+    EXPECT_EQ(wccp_add_group(&config), 0);
+    EXPECT_EQ(take_reasons(wccp_find_group(1)), "interface-missing: |absent1");
+    EXPECT_EQ(wccp_del_group(1), 0);
     strlcpy(config.interface, "absent2", sizeof config.interface);
     EXPECT_EQ(wccp_add_group(&config), 1);
 
@@ -515,8 +532,10 @@ TEST_F(Network, TheLinkStopsAndStartsTheGroups) {
     EXPECT_TRUE(wan->link_up == 0 && wan->ready_flags == WCCP_IPA_READY);
     EXPECT_EQ(known->hia_timer.active, 0);
     EXPECT_EQ(known->state_flags, WCCP_STATE_INIT);
+    EXPECT_EQ(take_reasons(known), "interface-down: |wan0");
     tell_link("wan0", 0, 1);
     tell_link("wan0", 0, 0);
+    EXPECT_EQ(take_reasons(known), "interface-down: |wan0 x2");
     EXPECT_TRUE(wan->link_down_count == 1 && wan->stop_count == 1);
     tell_link("wan0", 1, 1);
     EXPECT_EQ(wan->ready_flags, WCCP_ALL_READY);

@@ -121,27 +121,38 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         int result;
         counters moved;
         std::string line;
+        std::string reason = "message-malformed 10.0.0.1: "; // what is found of all reasons
     } rows[] = {
-        {bytes(7, 0), 1, all, "WCCP: unloading msg header failed."},
-        {longer, 0, none, "do not match. sender ip: 10.0.0.1"},
+        {bytes(7, 0), 1, all, "WCCP: unloading msg header failed.",
+         "message-malformed 10.0.0.1: a header of 7 bytes|8 bytes"},
+        {longer, 0, none, "do not match. sender ip: 10.0.0.1",
+         "message-length 10.0.0.1: 168 bytes in its header|169 bytes received"},
         {bytes(good.begin(), good.end() - 1), 0, none,
          "WCCP: message header length (160) and actual packet length (167) do not match. sender ip: "
-         "10.0.0.1"},
-        {changed(4, 1), 0, none, "WCCP rxed verion (256) is not supported. sender ip: 10.0.0.1"},
-        {changed(3, 10), 0, none, "10.0.0.1"}, // a Here-I-Am
-        {changed(3, 12), 0, none, "10.0.0.1"}, // a Redirect-Assign
-        {changed(0, 1), 0, none, "10.0.0.1"},  // a type of more than 16 bits
+         "10.0.0.1",
+         "message-length"},
+        {changed(4, 1), 0, none, "WCCP rxed verion (256) is not supported. sender ip: 10.0.0.1",
+         "message-version 10.0.0.1: 0x100|0x200"},
+        {changed(3, 10), 0, none, "10.0.0.1", "message-type 10.0.0.1: type 10|11 or 13"}, // a Here-I-Am
+        {changed(3, 12), 0, none, "10.0.0.1", "message-type"},                            // a Redirect-Assign
+        {changed(0, 1), 0, none, "10.0.0.1", "message-type"}, // a type of more than 16 bits
         {with({}), 1, all, "WCCP: unloading security info failed."},
         {with({security}), 1, all, "WCCP: unloading service info failed."},
-        {with({security, service(52)}), 1, all, "WCCP GRP 52: rxed service group (52) is not configured."},
-        {changed(15, 2), 1, bad_option, "WCCP GRP 51: rxed mismatch security opt: 2 configured opt: 0"},
+        {with({security, service(52)}), 1, all, "WCCP GRP 52: rxed service group (52) is not configured.",
+         "group-unknown 10.0.0.1: group 52|"},
+        {changed(15, 2), 1, bad_option, "WCCP GRP 51: rxed mismatch security opt: 2 configured opt: 0",
+         "security-unwanted 10.0.0.1: option 2|none"},
         {with({security, service()}), 0, bad_icu, "WCCP: unloading router identity failed."},
         {with({security, service(), identity(1)}), 0, bad_icu, "WCCP: unloading router view failed."},
         {with({security, service(51, 201, 17, 3), identity(1)}), 0, bad_service,
          "WCCP GRP 51: service group config mismatch (router id: 10.0.0.1) .priority: rxed = 201 local = "
-         "200, protocol: rxed = 17 local = 6, service flags: rxed = 0x3 local =  0x13"},
-        {with({security, service(51, 199), identity(1)}), 0, bad_service, "config mismatch"},
-        {with({security, service(51, 200, 17), identity(1)}), 0, bad_service, "config mismatch"},
+         "200, protocol: rxed = 17 local = 6, service flags: rxed = 0x3 local =  0x13",
+         "service-mismatch 10.0.0.1: priority 201, protocol 17, flags 0x3|priority 200, protocol 6, flags "
+         "0x13"},
+        {with({security, service(51, 199), identity(1)}), 0, bad_service, "config mismatch",
+         "service-mismatch"},
+        {with({security, service(51, 200, 17), identity(1)}), 0, bad_service, "config mismatch",
+         "service-mismatch"},
         {with({security, service(51, 200, 6, 0x80000013), identity(1)}), 0, bad_service, "config mismatch"},
         {icu(1, no_view, {hex("000e 0000")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {icu(1, no_view, {hex("000f 0000")}), 0, bad_icu, "WCCP: unloading command ext comp. failed."},
@@ -153,16 +164,21 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {icu(1, no_view, {hex("0063 00")}), 0, bad_icu, "component type: 99 length 0 "},
         {icu(1, no_view, {hex("000e 00")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {icu(1, no_view, {by_hash, odd_command, odd_unknown, odd_unknown}), 0, bad_icu,
-         "WCCP GRP 51: ICU bogus packet  (too many optional components)."},
-        {icu(1, no_view, {}), 0, icu_alone, "incompatible capabilities"}, // GRE only
-        {icu(1, no_view, {capabilities(2, 1, 0)}), 0, bad_icu, "incompatible capabilities"},
-        {router_0, 0, icu_alone, ""},
+         "WCCP GRP 51: ICU bogus packet  (too many optional components).",
+         "message-malformed 10.0.0.1: 4 optional components|3 at most"},
+        {icu(1, no_view, {}), 0, icu_alone, "incompatible capabilities",
+         "forwarding-not-offered 10.0.0.1: gre|L2"},
+        {icu(1, no_view, {capabilities(2, 1, 0)}), 0, bad_icu, "incompatible capabilities",
+         "return-not-offered 10.0.0.1: none|gre or L2"},
+        {router_0, 0, icu_alone, "", "router-id-zero: |"},
         {wire_message(13, {security, service()}), 0, bad_query, "WCCP: unloading router query failed."},
         {query(1, 100), 0, query_alone,
-         "WCCP GRP 51: removal query request. cannot find router. (router id 10.0.0.1)"},
+         "WCCP GRP 51: removal query request. cannot find router. (router id 10.0.0.1)",
+         "query-refused 10.0.0.1: a query before an I-See-You|"},
         {query(1, 101), 0, query_alone,
          "WCCP GRP 51: removal query is not for us. sending router id: 10.0.0.1 target appliance: "
-         "10.0.0.101"},
+         "10.0.0.101",
+         ""},
     };
     const auto now = [this] {
         return counters{wccp_g.rx_failures,        group->rx_failures,          group->rx_icus,
@@ -179,6 +195,9 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         EXPECT_EQ(process(row.message), row.result);
         EXPECT_EQ(now(), expected);
         EXPECT_EQ(group->sending_routers, nullptr);
+        const std::string reasons = take_reasons(group) + take_reasons(nullptr);
+        EXPECT_NE(reasons.find(row.reason), std::string::npos) << reasons;
+        EXPECT_EQ(reasons.empty(), row.reason.empty()) << reasons;
         const std::string lines = log.take();
         EXPECT_NE(lines.find(row.line), std::string::npos) << lines;
         EXPECT_EQ(lines.find("WCCP processing received packet from 10.0.0.1 failed") != std::string::npos,
@@ -314,6 +333,7 @@ TEST_F(Messages, AnISeeYouThatIsCutLeavesTheGroupAsItWas) {
         EXPECT_EQ(group->rx_icu_failures, before->rx_icu_failures + 1) << length;
         before->rx_icus++;
         before->rx_icu_failures++;
+        memcpy(before->reasons, group->reasons, sizeof group->reasons);
         EXPECT_EQ(memcmp(before.get(), group, sizeof *group), 0) << length;
         EXPECT_EQ(memcmp(&router_before, router(2), sizeof router_before), 0) << length;
         refused++;
@@ -328,6 +348,7 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
     const wire_bytes seen = view(1, {{100, 100, 0x01}, {101, 50, 0xff}}, 5);
     // Odd lengths put the capabilities, which must be found, on odd addresses.
     EXPECT_EQ(process(icu(1, seen, {odd_unknown, odd_command, by_hash}), ipa(7, 7)), 0);
+    EXPECT_EQ(take_reasons(group), "");
     EXPECT_EQ(group->rx_icu_failures, 0u);
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
@@ -354,6 +375,9 @@ TEST_F(Messages, AMapFillsTheRoutersView) {
     // 102 is in no view, and the view has 100 twice.
     const std::vector<uint32_t> owners = {100, 100, 101, 102, 102, 100, 101, 101, 101, 100};
     EXPECT_EQ(process(icu(1, mask_view(1, {100, 101, 100}), {odd_unknown, map(owners), by_mask})), 0);
+    EXPECT_EQ(take_reasons(group),
+              "mask-differs 10.0.0.1: src 0x1741 dst 0xf00 ports 0x1 0x2|src 0x0 dst 0x0 "
+              "ports 0x0 0x0");
     EXPECT_EQ(group->rx_icu_failures, 0u);
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
@@ -397,6 +421,12 @@ TEST_F(Messages, AMapFillsTheRoutersView) {
     EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {map({100, 100}), empty, rest})), 0);
     EXPECT_EQ(group->rx_icu_failures, 2u);
     EXPECT_TRUE(made->view_appliance_count == 2 && made->self_buckets == 1);
+
+    // What is reported by hash where mask was agreed.
+    take_reasons(group);
+    process(icu(2, view(2, {{101, 50, 0xff}}), {by_mask}));
+    EXPECT_EQ(take_reasons(group), "method-differs 10.0.0.2: hash by the router|mask x2; "
+                                   "not-in-view 10.0.0.2: 1 appliances|10.0.0.100");
 }
 
 TEST_F(Messages, AMapOfAFullPacketIsTakenWhole) {
@@ -445,6 +475,8 @@ TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
         EXPECT_EQ(group->tx_redirect_assign, step.assignments);
         EXPECT_EQ(!(router(step.router)->flags & WCCP_RTR_ASSIGN_UNACKED), step.acked);
         EXPECT_TRUE(group->pending_acks == step.pending && group->assign_timer.active == step.timer);
+        const std::string reasons = take_reasons(group), wanted = "|table 10.0.0.100 number 1";
+        EXPECT_EQ(reasons.find(wanted) != std::string::npos, step.assignments > 1 && !step.acked) << reasons;
     }
     // Nothing outstanding: the timer stops as well, and nothing wraps.
     router(1)->flags |= WCCP_RTR_ASSIGN_UNACKED;
@@ -472,9 +504,26 @@ TEST_F(Messages, TheDigestDecides) {
     EXPECT_EQ(process(good), 1);
     group->security_option = 0;
     EXPECT_EQ(process(good), 1);
+    const std::string reasons = "password-mismatch 10.0.0.1: | x5; security-missing 10.0.0.1: none|MD5; "
+                                "security-unwanted 10.0.0.1: MD5|none";
+    EXPECT_EQ(take_reasons(group), reasons);
+    // An I-See-You that is taken ends them, but not in their own second, and not those of others.
+    EXPECT_EQ(process(good), 1);
+    EXPECT_EQ(process(good, ipa(0, 2)), 1);
+    for (uint32_t second = 0; second < 2; second++, wccp_g.seconds++)
+        process(icu(1, view(1, {{100, 100, 0}})));
+    EXPECT_EQ(take_reasons(group), "security-unwanted 10.0.0.2: MD5|none");
+    // Strangers push out one another, and no router of the group.
+    EXPECT_EQ(process(good), 1);
+    for (uint8_t i = 0; i < 100; i++, wccp_g.seconds++)
+        process(good, ipa(7, i));
+    const std::string all = take_reasons(group);
+    EXPECT_NE(all.find("unwanted 10.0.0.1: "), std::string::npos) << all;
+    EXPECT_EQ(all.find("10.0.7.0:"), std::string::npos) << all;
+    EXPECT_NE(all.find("10.0.7.99:"), std::string::npos) << all;
     EXPECT_EQ((numbers{group->rx_auth_failures, group->rx_auth_mismatches, group->rx_failures,
                        wccp_g.rx_failures, group->rx_icus}),
-              (numbers{5, 2, 7, 7, 1}));
+              (numbers{5, 2 + 103, 7 + 103, 7 + 103, 1 + 2}));
 }
 
 TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
@@ -512,6 +561,8 @@ TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
     EXPECT_EQ(group->tx_removal_replies, 1u);
     EXPECT_EQ(wccp_transmit_packet(group, nullptr, 10), 1);
     EXPECT_EQ(group->tx_failures, 3u);
+    EXPECT_EQ(take_reasons(group), "table-not-built: redirect assign: groups actual assignment method is "
+                                   "not set.|; send-failed 255.255.255.255: Permission denied|108 bytes");
     EXPECT_EQ(engine.sent_to("10.0.0.1"), bytes{});
 }
 

@@ -252,7 +252,7 @@ wire_bytes hash_form(uint32_t last_octet, uint32_t weight, wire_bytes buckets, u
 }
 struct decoded_elements {
     wccp_rtr_view_appliance list[WCCP_MAX_APPLIANCES] = {};
-    wccp_assign_summary hash = {9, 9, 9};
+    wccp_assign_summary hash = {9, 9, 9, 9};
     int result = -1;
 };
 // Without the last `cut` bytes.

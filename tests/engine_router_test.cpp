@@ -75,6 +75,8 @@ TEST_F(RouterTest, RefusalsAndRoutersAreToldInTheLog) {
     tells({refused + " assign method: mask  router assign method: hash"});
     decide(3, 3, 0);
     tells({refused + " return method: gre or L2  router return method: none"});
+    EXPECT_EQ(take_reasons(group), "forwarding-not-offered 10.0.0.201: gre|L2; assignment-not-offered "
+                                   "10.0.0.201: hash|mask; return-not-offered 10.0.0.201: none|gre or L2");
     const wccp_rtr_capabilities agreed = {2, 1, 2};
     wccp_create_sending_router(group, ROUTER_A, &agreed, &agreed);
     tells({"agreed capabilities: fwd: 2 assign: 1 return: 2 deciding rtr id 10.0.0.201",
@@ -88,6 +90,7 @@ TEST_F(RouterTest, RefusalsAndRoutersAreToldInTheLog) {
     wccp_g.seconds += 40;
     wccp_monitor_sending_routers(group);
     tells({"removing router (router id: 10.0.0.201) due to inactivity."});
+    EXPECT_EQ(take_reasons(group), "router-id-zero: |; router-silent 10.0.0.201: |an I-See-You within 40 s");
 }
 
 TEST_F(RouterTest, WhatTheFirstRouterAgreedHoldsForAll) {
@@ -191,6 +194,8 @@ TEST_F(RouterTest, QueriesAreAnsweredToTwoWayRoutersAndAFloodIsBounded) {
     for (int query = 1; query < 100; query++)
         answered += wccp_process_router_removal_query(group, ROUTER_A, host(78)) == 0;
     EXPECT_EQ(answered, 8);
+    EXPECT_EQ(take_reasons(group), "query-refused 10.0.0.202: a query before an I-See-You|; query-refused "
+                                   "10.0.0.201: one more query|8 replies waiting at most x93");
     EXPECT_TRUE(log.say("maximum of waiting replies (8) reached. (router id 10.0.0.201)"));
     see(ROUTER_B, {ROUTER_A}, {{US, 100}}); // and doesn't lose its answer by that
     EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_B, host(79)), 0);

@@ -106,14 +106,20 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
         std::vector<be32> routers;
         std::vector<uint32_t> appliances; // 10.0.0.x, of weight 100
         const char *elected;              // key, acknowledgements due, slots of each active appliance
+        const char *reasons = nullptr;    // null: not looked at
     } steps[] = {
-        {A, {A, B}, {1}, "no"}, // B is not heard
-        {B, {A, B}, {}, "no"},  // B doesn't list us
-        {B, {A, B}, {1, 2}, "1 2 1:256"},
-        {C, {}, {}, "1 2 1:256"},   // no change of any view
-        {B, {A, B}, {1, 3}, "1 0"}, // nobody is reported by all of them
-        {C, {}, {0, 1}, "no"},      // a lower one
-        {C, {}, {1}, "1 3 1:256"},  // the key counts from the start
+        {A, {A, B}, {1}, "no", "election-blocked 10.0.0.202: no I-See-You|two-way"},
+        {B, {A, B}, {}, "no", "election-blocked 10.0.0.202: one-way|two-way"},
+        {B, {A, B}, {1, 2}, "1 2 1:256", ""},
+        {C, {}, {}, "1 2 1:256"}, // no change of any view
+        {B,
+         {A, B},
+         {1, 3},
+         "1 0", // nobody is reported by all of them
+         "appliance-left-out 10.0.0.3: in 1 views|in those of all 3 routers; appliance-left-out 10.0.0.1: in "
+         "2 views|in those of all 3 routers"},
+        {C, {}, {0, 1}, "no"},     // a lower one
+        {C, {}, {1}, "1 3 1:256"}, // the key counts from the start
         {A, {A, B}, {1, 3}, "2 3 1:256"},
         {B, {A, B}, {3, 1, 4}, "3 3 1:256"},
         {A, {A, B}, {4, 3, 1}, "4 3 1:256"},
@@ -142,6 +148,8 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
         for (const auto &[octet, assigned] : shares)
             elected += " " + std::to_string(octet) + ":" + std::to_string(assigned);
         EXPECT_EQ(group->designated ? elected : "no", step.elected);
+        const std::string reasons = take_reasons(group);
+        EXPECT_EQ(reasons, step.reasons ? step.reasons : reasons);
     }
     EXPECT_EQ(wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_WEIGHT_CHANGE), 0);
     EXPECT_EQ(group->assign_timer.active, 0);
@@ -361,18 +369,22 @@ TEST_F(CheckTest, TheAssignmentIsComparedOrSearchedForHoles) {
     };
     const std::string first = begin + "verify " + compared("2", "202", 128) + "verify " +
                               compared("2", "201", 128) + "verify " + compared("1", "202", 128);
+    take_reasons(group);
     EXPECT_EQ(allocation(), begin + mismatch("2", "202", 0) + raise);
+    EXPECT_EQ(take_reasons(group), "assignment-differs 10.0.0.202: 0 buckets for 10.0.0.2|128");
     for (const be32 id : {ROUTER_A, ROUTER_B})
         for (uint32_t i = 0; i < 2; i++)
             router(id)->view_appliances[i].buckets_assigned = 128;
     EXPECT_EQ(allocation(), first + "verify " + compared("1", "201", 128) + clear);
     router(ROUTER_A)->view_appliances[0].buckets_assigned = 127;
     EXPECT_EQ(allocation(), first + mismatch("1", "201", 127) + raise);
+    wccp_g.seconds++;
     router(ROUTER_A)->view_appliances[0].buckets_assigned = 128;
     router(ROUTER_A)->view_appliances[2].weight = 1; // and no buckets
     EXPECT_EQ(allocation(),
               first + "verify " + compared("1", "201", 128) +
                   "allocation mismatch. appliance 10.0.0.3 weight : 1 router 10.0.0.201 buckets : 0\n");
+    EXPECT_EQ(take_reasons(group), "assignment-differs 10.0.0.201: 0 buckets for 10.0.0.3|some x2");
 }
 
 } // namespace

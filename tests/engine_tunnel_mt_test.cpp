@@ -11,6 +11,7 @@
 #include "engine/wccpd_common.h"
 #include "tests/support/fake_tunneld.h"
 #include "tests/support/log_lines.h"
+#include "tests/support/reported_group.h"
 
 namespace {
 
@@ -28,8 +29,10 @@ struct Tunnels : testing::Test {
     Tunnels() : tunneld(tunneld_does) {
         allocated = wccp_g.stat_allocs - wccp_g.stat_frees;
         wccpd_exiting = 0;
+        wccp_g.groups[1] = wccp_g.groups[51] = &group;
     }
     ~Tunnels() override {
+        wccp_g.groups[1] = wccp_g.groups[51] = nullptr;
         wccpd_exiting = 0;
         tunneld.answer_with(tunneld_does);
         EXPECT_EQ(wccp_del_all_tunnels(), 0);
@@ -49,6 +52,7 @@ struct Tunnels : testing::Test {
     fake_tunneld tunneld;
     uint32_t allocated;
     log_lines log;
+    wccp_service_group group = {}; // for the reasons alone
 };
 
 std::optional<tunneld_answer> tunneld_refuses(const seen_command &command) {
@@ -90,6 +94,7 @@ TEST_F(Tunnels, ThirtyTwoIdsAndTheFreedOneIsNext) {
     EXPECT_EQ(commands().back().tunnel_id, g_qv_encap_wccp_last);
     EXPECT_EQ(wccp_add_tunnel(1, self, router(32)), 1);
     EXPECT_TRUE(log.say("WCCP GRP 1: No free tunnel id available"));
+    EXPECT_EQ(take_reasons(&group), "tunnel-ids-exhausted 10.0.1.32: |ids 1000 to 1031");
     EXPECT_EQ(wccp_add_tunnel(1, self, router(4)), 0) << "an old one needs no id";
     EXPECT_EQ(commands().size(), 0u);
     for (const uint32_t i : {31u, 7u}) {
@@ -106,6 +111,7 @@ TEST_F(Tunnels, ARefusedAddLeavesNothing) {
         tunneld.answer_with(answer);
         EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 1);
         EXPECT_TRUE(log.say("WCCP GRP 51: failed to add tunnel: id: 1000 10.0.0.1 <=> 10.0.1.1"));
+        EXPECT_EQ(take_reasons(&group), "tunnel-refused 10.0.1.1: tunnel id 1000|from 10.0.0.1");
         EXPECT_EQ(commands().size(), 1u);
         EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
         EXPECT_EQ(commands().size(), 0u) << "it isn't in the table";

@@ -73,9 +73,10 @@ complains '*there is nothing below*'
 
 expect 0 'jq:
     def dotted: test("^[0-9]+[.][0-9]+[.][0-9]+[.][0-9]+$");
-    (map({key: .name, value: .}) | from_entries) as $n | (map([.name, .type]) | sort) == ([
+    (map({key: .name, value: .}) | from_entries) as $n | (map(select(.name | test("/(counter|reason)/") | not) | [.name, .type]) | sort) == ([
         ["", "string"], ["/oper", "string"], ["/uptime", "duration_ms"], ["/app_id", "string"],
         ["/num_routers", "uint32"], ["/num_appliances", "uint32"], ["/debug", "string"], ["/assignment", "string"],
+        ["/since", "duration_ms"], ["/pending_acks", "uint32"], ["/router/1/heard", "duration_ms"],
         ["/router/1", "string"], ["/router/1/state", "string"], ["/router/1/fwd_method", "string"],
         ["/router/1/ret_method", "string"], ["/router/1/assign_method", "string"], ["/router/1/id", "ipv4addr"],
         ["/router/1/ipaddr", "ipv4addr"], ["/router/1/conn_time", "duration_ms"],
@@ -87,13 +88,14 @@ expect 0 'jq:
         "'$S'/appliance/1/ipaddr", "'$S'/appliance/1/weight"] | .value] ==
         ["51", "ACTIVE, DESIGNATED", "10.0.0.101", 1, 1, "1", "TWO-WAY connected", "10.0.0.1", "10.0.0.101", 100, "10.0.0.101", 100])
     and all($n["'$S'/router/1/fwd_method", "'$S'/router/1/ret_method"].value; . == "GRE" or . == "L2")
+    and $n["'$S'/counter/tx_here_i_am"].value > 0 and $n["'$S'/counter/rx_icu_failures"].value == 0
     and ($n["'$S'/router/1/assign_method"].value | . == "HASH" or . == "MASK")
     and ($n["'$S'/router/1/id"].value | dotted)
     and all($n["'$S'/uptime", "'$S'/router/1/conn_time"].value; type == "number" and . > 0 and . % 1000 == 0)
     and all($n["'$S'/debug", "'$S'/assignment"].value; contains("\n")) and (tostring | contains("geheim") | not)' --json walk $S
 expect 0 '*WCCP password * : geheim *' get --secrets $S/debug
-expect 0 'jq:all(.type == "string") and (map({key: (.name | ltrimstr("/qv/wccpd/system/state/")), value: .value}) | from_entries) as $n |
-    ($n | keys) == ["debug_all", "debug_global", "is_alive", "proto_ver", "version"] and $n.proto_ver == "2.0" and $n.is_alive == "Ready"' \
+expect 0 'jq:(map({key: (.name | ltrimstr("/qv/wccpd/system/state/")), value: .value}) | from_entries) as $n |
+    ($n | keys - ["debug_all", "debug_global", "is_alive", "proto_ver", "version"] | length) == 7 and $n["interface/eth0/link"] == "up" and $n.proto_ver == "2.0" and $n.is_alive == "Ready"' \
     --json walk /qv/wccpd/system/state
 expect 0 'jq:map(.name) == ["'$S'"]' --json walk --children "${S%/*}"
 expect 0 "*$S/debug ="$'\n    '"*$S/appliance/1/weight = 100*" walk /

@@ -140,6 +140,10 @@ const std::vector<schema_row> &schema() {
     return rows;
 }
 
+#define REASONS(node)                                                                                        \
+    node "/reason/*", node "/reason/*/code", node "/reason/*/sender", node "/reason/*/offered",              \
+        node "/reason/*/wanted", node "/reason/*/count", node "/reason/*/first", node "/reason/*/last"
+
 const std::vector<const char *> &wccpd_state_nodes() {
     static const std::vector<const char *> nodes = {
         NODE_WCCPD_STATE "/proto_ver",
@@ -147,12 +151,24 @@ const std::vector<const char *> &wccpd_state_nodes() {
         NODE_WCCPD_STATUS,
         NODE_WCCPD_STATE "/debug_global",
         NODE_WCCPD_STATE "/debug_all",
+        REASONS(NODE_WCCPD_STATE),
+        NODE_WCCPD_STATE "/interface/*",
+        NODE_WCCPD_STATE "/interface/*/address",
+        NODE_WCCPD_STATE "/interface/*/link",
+        NODE_WCCPD_STATE "/interface/*/starts",
+        NODE_WCCPD_STATE "/interface/*/stops",
+        NODE_WCCPD_STATE "/interface/*/link_downs",
+        NODE_WCCPD_STATE "/interface/*/address_changes",
         NODE_GROUP_STATE "/*",
         NODE_GROUP_STATE "/*/oper",
         NODE_GROUP_STATE "/*/uptime",
         NODE_GROUP_STATE "/*/app_id",
         NODE_GROUP_STATE "/*/num_routers",
         NODE_GROUP_STATE "/*/num_appliances",
+        NODE_GROUP_STATE "/*/since",
+        NODE_GROUP_STATE "/*/pending_acks",
+        REASONS(NODE_GROUP_STATE "/*"),
+        NODE_GROUP_STATE "/*/counter/*",
         NODE_GROUP_STATE "/*/debug",
         NODE_GROUP_STATE "/*/assignment",
         NODE_GROUP_STATE "/*/owners",
@@ -164,6 +180,7 @@ const std::vector<const char *> &wccpd_state_nodes() {
         NODE_GROUP_STATE "/*/router/*/id",
         NODE_GROUP_STATE "/*/router/*/ipaddr",
         NODE_GROUP_STATE "/*/router/*/conn_time",
+        NODE_GROUP_STATE "/*/router/*/heard",
         NODE_GROUP_STATE "/*/router/*/appliance/*",
         NODE_GROUP_STATE "/*/router/*/appliance/*/load_dist",
         // Appliances are asked for by number; as a node of its own the number keeps a walk out of it.

@@ -75,6 +75,23 @@ void reported_group::see(be32 from, const std::vector<be32> &routers,
     report(from, appliances);
 }
 
+std::string take_reasons(wccp_service_group *group) {
+    std::string out;
+    uint32_t count;
+    wccp_reason *const table = wccp_reasons_of(group, &count);
+    for (wccp_reason *each = table; each < table + count; each++) {
+        if (each->code == WCCP_REASON_NONE)
+            continue;
+        out += (out.empty() ? "" : "; ") + std::string(wccp_reason_word(each->code));
+        if (!is_zero(each->sender))
+            out += std::string(" ") + addr_text(each->sender).s;
+        out += std::string(": ") + each->offered.s + "|" + each->wanted.s;
+        out += each->count > 1 ? " x" + std::to_string(each->count) : "";
+        each->code = WCCP_REASON_NONE;
+    }
+    return out;
+}
+
 all_freed::~all_freed() {
     EXPECT_EQ(wccp_g.stat_allocs.load(), wccp_g.stat_frees.load());
 }

@@ -2,6 +2,7 @@
 // network. Its one interface is ready but has no sockets: what it sends is built and counted.
 #pragma once
 
+#include <string>
 #include <utility>
 #include <vector>
 
@@ -32,6 +33,10 @@ struct reported_group {
     wccp_interface interface = {};
     wccp_service_group *group;
 };
+
+// The reasons of a group, or of no group, and none of them afterwards: "CODE SENDER: OFFERED|WANTED xCOUNT"
+// each, the sender and the count only where there is one and more than one, and a ";" in between.
+std::string take_reasons(wccp_service_group *group);
 
 // As a base before reported_group: at the end of a test all that the engine allocated is free again.
 struct all_freed {
