@@ -110,7 +110,7 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
     } steps[] = {
         {A, {A, B}, {1}, "no", "election-blocked 10.0.0.202: no I-See-You|two-way"},
         {B, {A, B}, {}, "no", "election-blocked 10.0.0.202: one-way|two-way"},
-        {B, {A, B}, {1, 2}, "1 2 1:256", ""},
+        {B, {A, B}, {1, 2}, "1 2 1:256", "appliance-left-out 10.0.0.2: in 1 views|in those of all 2 routers"},
         {C, {}, {}, "1 2 1:256"}, // no change of any view
         {B,
          {A, B},

@@ -95,7 +95,7 @@ expect 0 'jq:
     and all($n["'$S'/debug", "'$S'/assignment"].value; contains("\n")) and (tostring | contains("geheim") | not)' --json walk $S
 expect 0 '*WCCP password * : geheim *' get --secrets $S/debug
 expect 0 'jq:(map({key: (.name | ltrimstr("/qv/wccpd/system/state/")), value: .value}) | from_entries) as $n |
-    ($n | keys - ["debug_all", "debug_global", "is_alive", "proto_ver", "version"] | length) == 7 and $n["interface/eth0/link"] == "up" and $n.proto_ver == "2.0" and $n.is_alive == "Ready"' \
+    ($n | keys - ["debug_all", "debug_global", "is_alive", "proto_ver", "version"] | length) == 14 and $n["interface/eth0/link"] == "up" and $n.proto_ver == "2.0" and $n.is_alive == "Ready"' \
     --json walk /qv/wccpd/system/state
 expect 0 'jq:map(.name) == ["'$S'"]' --json walk --children "${S%/*}"
 expect 0 "*$S/debug ="$'\n    '"*$S/appliance/1/weight = 100*" walk /
