@@ -124,8 +124,8 @@ int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
         return 1;
     }
     wccp_reason_code failure = WCCP_REASON_NONE;
-    if (wccp_add_tunnel_encap(id.id, mailbox_address_of(local), mailbox_address_of(remote),
-                              &tunnel.pointer->dataplane_index, &failure) == 1) {
+    if (wccp_add_tunnel_or_say_why(id.id, mailbox_address_of(local), mailbox_address_of(remote),
+                                   &tunnel.pointer->dataplane_index, &failure) == 1) {
         note_failure(group, failure, remote, wccp_reason_value("tunnel id %d", id.id),
                      wccp_reason_value("from %s", addr_text(local).s));
         WCCP_COMPLAIN(LC_LOG_NOTICE, "WCCP GRP %d: failed to add tunnel: id: %d %s <=> %s", group, id.id,

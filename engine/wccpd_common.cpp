@@ -240,15 +240,18 @@ mailbox_inputs tunnel_inputs(uint16_t tunnel_id, mailbox_address local, mailbox_
 } // namespace
 
 int wccp_add_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
-                          uint32_t *inout_index, wccp_reason_code *out_failure) {
+                          uint32_t *inout_index) {
+    wccp_reason_code unused;
+    return wccp_add_tunnel_or_say_why(tunnel_id, local, remote, inout_index, &unused);
+}
+
+int wccp_add_tunnel_or_say_why(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
+                               uint32_t *inout_index, wccp_reason_code *out_failure) {
     const mailbox_inputs inputs = tunnel_inputs(tunnel_id, local, remote, *inout_index);
     uint32_t status, index;
-    wccp_reason_code failure;
-    const bool answered = give_command(&add_tunnel, &inputs, &status, &index, &failure);
-    if (out_failure)
-        *out_failure = answered ? WCCP_REASON_TUNNEL_REFUSED : failure;
-    if (!answered)
+    if (!give_command(&add_tunnel, &inputs, &status, &index, out_failure))
         return 1;
+    *out_failure = WCCP_REASON_TUNNEL_REFUSED; // if it is one
     *inout_index = index;
     return index == WCCP_NO_INDEX ? 1 : static_cast<int>(status);
 }

@@ -15,9 +15,12 @@ int wccp_cleanup_shmem();
 // Commands: each waits for tunneld's answer, up to about 2 seconds. After one that timed out, adds and L2
 // returns fail at once for up to 10 seconds, and further deletes are given but not waited for; during the
 // exit nothing is waited for after a time-out. Addresses in host order. tunneld's status, in which 1 is
-// failure; 1 as well without an answer. `out_failure`, unless it is null: what an add that failed failed for.
+// failure; 1 as well without an answer.
 int wccp_add_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
-                          uint32_t *inout_index, wccp_reason_code *out_failure = nullptr);
+                          uint32_t *inout_index);
+// The same add; `out_failure` is the reason when it has failed.
+int wccp_add_tunnel_or_say_why(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
+                               uint32_t *inout_index, wccp_reason_code *out_failure);
 int wccp_del_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
                           uint32_t *inout_index);
 int wccp_set_L2_return(uint8_t group_id, uint32_t value);
