@@ -183,6 +183,7 @@ struct Mgmtd : testing::Test {
     int64_t now = 1000;
     std::vector<sent_message> sent;
     std::string said;
+    uint32_t asker = 3; // whose set requests are
     char file[32] = "/tmp/mgmtd-test-XXXXXX";
 
     void SetUp() override {
@@ -269,16 +270,17 @@ struct Mgmtd : testing::Test {
         std::string name, value;
         uint32_t type = bn_type_str;
     };
-    uint32_t set(const std::vector<set_node> &nodes) {
+    uint32_t set(const std::vector<set_node> &nodes, uint32_t commit_flags = 0, uint32_t revision = 0) {
         bn_request_msg *msg = nullptr;
-        EXPECT_EQ(bn_set_request_msg_create(&msg, 0), LC_OK);
+        EXPECT_EQ(bn_set_request_msg_create(&msg, commit_flags), LC_OK);
+        msg->number = revision;
         for (const set_node &node : nodes) {
             bn_binding *binding = make_binding(node.name, {node.type, node.value});
             EXPECT_EQ(bn_set_request_msg_append_binding_takeover(msg, node.subop, 0, &binding, nullptr),
                       LC_OK);
         }
         clear();
-        EXPECT_TRUE(give(3, msg));
+        EXPECT_TRUE(give(asker, msg));
         return code();
     }
     const bn_response_msg *last_response() {
@@ -538,6 +540,185 @@ TEST_F(Mgmtd, TheFileHoldsEachCommitBeforeItIsTold) {
     EXPECT_EQ(daemon.tree.set, kept);
 }
 
+// Each is a server of its own over the same files.
+TEST_F(Mgmtd, CommitsAreKeptOverAStart) {
+    int64_t clock = 1000000;
+    const auto start = [&] {
+        std::string errors, warnings;
+        daemon.kept = {};
+        daemon.tree = {};
+        daemon.return_at_ms = -1;
+        daemon.clock_s = [&] { return clock; };
+        ASSERT_TRUE(server_load(&daemon, &errors, &warnings)) << errors;
+        server_begin(&daemon);
+    };
+    const auto history = [&] { // number, cause and whether it waits, of the last three
+        std::string out;
+        const std::vector<history_entry> &all = daemon.kept.entries;
+        for (size_t i = all.size() - std::min<size_t>(all.size(), 3); i < all.size(); i++)
+            out += std::to_string(all[i].number) + " " + all[i].cause + (all[i].returns_to ? " waits; " : "; ");
+        return out;
+    };
+    const auto weight = [&] { return daemon.tree.nodes[named(GROUP + "/weight")].text; };
+    const auto text_of = [&](uint32_t number) {
+        query(3, NODE_COMMITS "/" + std::to_string(number) + "/text", bn_query_get);
+        return found().empty() ? "none" : found()[0].substr(found()[0].find('=') + 1);
+    };
+    const std::string commits = daemon.file.path + ".history", pending = commits + "/pending";
+    start();
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/weight", "1"}}), 0u) << message();
+    EXPECT_EQ(history(), "1 found at the start; 2 mgmtctl-8; ");
+    EXPECT_EQ(text_of(2), content());
+    start();
+    EXPECT_EQ(history(), "1 found at the start; 2 mgmtctl-8; ") << "it is the same, and no new one";
+    EXPECT_EQ(daemon.tree.revision, 2u);
+    reload(content() + "priority = 1\n");
+    std::ofstream(daemon.file.path, std::ios::app) << "encap = l2\n";
+    std::ofstream(commits + "/commit-x") << "";
+    start();
+    EXPECT_EQ(history(), "2 mgmtctl-8; 3 the configuration file was read again; 4 found at the start; ");
+
+    // One that was cut short counts when the file has been replaced.
+    std::string reason;
+    const history_entry cut = {5, clock, "root", "cut", 1, "x"};
+    for (const bool replaced : {false, true}) {
+        ASSERT_TRUE(history_prepare(daemon.kept, cut, content() + "weight = 2\n", &reason)) << reason;
+        if (replaced)
+            std::ofstream(daemon.file.path, std::ios::app) << "weight = 2\n";
+        std::ofstream(pending + ".unfinished") << "#% comm";
+        const std::string before = history();
+        // The weight is given twice, which is no matter of the history.
+        history_open(&daemon.kept, content(), daemon.say);
+        EXPECT_EQ(history() == before, !replaced);
+        EXPECT_TRUE(access(pending.c_str(), F_OK) != 0 && access((pending + ".unfinished").c_str(), F_OK) != 0);
+    }
+    EXPECT_EQ(history_find(daemon.kept, 5)->cause, "cut");
+
+    // What a commit depends on.
+    std::ofstream(daemon.file.path) << "[" << GROUP << "]\nweight = 3\n";
+    start();
+    const uint32_t at = daemon.tree.revision;
+    const set_node four = {bn_set_modify, GROUP + "/weight", "4"};
+    EXPECT_EQ(set({four}, 0, at - 1), static_cast<uint32_t>(LC_ASSERTION));
+    EXPECT_EQ(set({four}, 4), static_cast<uint32_t>(LC_NOT_IMPLEMENTED));
+    EXPECT_EQ(set({four}, bn_cf_check_only), 0u);
+    EXPECT_EQ(message(), "1 node would change");
+    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "x"}}, bn_cf_check_only),
+              static_cast<uint32_t>(LC_BAD_ARGUMENT));
+    EXPECT_EQ(weight() + std::to_string(daemon.tree.revision), "3" + std::to_string(at));
+
+    // One that waits to be confirmed: nothing else is taken, and it is undone in time, also by the next mgmtd.
+    const auto tick = [&](int64_t seconds) {
+        clock += seconds;
+        now += seconds * 1000;
+        const int64_t next = server_tick(&daemon);
+        return next < 0 ? -1 : next - now;
+    };
+    const uint32_t minutes = 2u << bn_cf_minutes_shift;
+    for (const char *end : {"time", "start", "clock", "confirmed", "rollback"}) {
+        const std::string how = end;
+        ASSERT_EQ(set({four}, minutes, daemon.tree.revision), 0u) << message();
+        EXPECT_EQ(tick(20), 100000);
+        EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "5"}}), static_cast<uint32_t>(LC_ASSERTION));
+        reload("[" + GROUP + "]\nweight = 9\n");
+        EXPECT_EQ(weight(), "4") << said;
+        std::ofstream(daemon.file.path) << *daemon.file.seen;
+        if (how == "clock")
+            clock -= 1000000;
+        if (how == "start" || how == "clock") {
+            start();
+            EXPECT_EQ(tick(0), how == "clock" ? 120000 : 100000);
+        }
+        if (how == "confirmed") {
+            daemon.file.path += "/no";
+            const std::string directory = std::exchange(daemon.kept.directory, "/no/such");
+            action(3, ACTION_CONFIRM, {});
+            EXPECT_EQ(code(), static_cast<uint32_t>(LC_IO_ERROR)) << "it still waits";
+            daemon.file.path.resize(daemon.file.path.size() - 3);
+            daemon.kept.directory = directory;
+            action(3, ACTION_CONFIRM, {});
+            EXPECT_EQ(code(), 0u) << message();
+            start();
+        } else if (how == "rollback") {
+            EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "3"}}, bn_cf_ends_wait), 0u) << message();
+        } else {
+            EXPECT_EQ(tick(how == "clock" ? 119 : 99), 1000);
+            EXPECT_EQ(weight(), "4");
+            // On a disk that is full it is tried again.
+            const std::string directory = std::exchange(daemon.kept.directory, "/no/such");
+            EXPECT_EQ(tick(1), 60000) << how;
+            daemon.kept.directory = directory;
+            EXPECT_EQ(tick(60), -1);
+        }
+        EXPECT_EQ(weight(), how == "confirmed" ? "4" : "3") << how;
+        EXPECT_EQ(tick(200), -1) << "nothing waits any more";
+        EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "3"}}), 0u);
+    }
+    action(3, ACTION_CONFIRM, {});
+    EXPECT_EQ(code(), static_cast<uint32_t>(LC_NOT_FOUND));
+
+    for (int i = 0; i < 60; i++)
+        ASSERT_EQ(set({{bn_set_modify, GROUP + "/weight", std::to_string(100 + i)}}), 0u) << message();
+    const uint32_t last = daemon.tree.revision;
+    EXPECT_EQ(daemon.kept.entries.size(), HISTORY_MAX);
+    query(3, NODE_COMMITS, bn_query_iterate);
+    EXPECT_EQ(found().size(), HISTORY_MAX);
+    EXPECT_EQ(text_of(last - 50), "none");
+    EXPECT_NE(text_of(last - 49).find("weight = 110"), std::string::npos);
+    std::ofstream(commits + "/commit-" + std::to_string(last - 1)) << "#% commit 1\n";
+    start();
+    EXPECT_EQ(daemon.kept.entries.size(), HISTORY_MAX - 1) << "an entry that can't be read is reported";
+    EXPECT_NE(said.find("commit " + std::to_string(last - 1) + " can't be read"), std::string::npos) << said;
+}
+
+TEST_F(Mgmtd, WhoMayOnlyLookChangesNothingAndSeesNoPassword) {
+    std::ofstream(daemon.file.path) << "# geheim before\n[" << GROUP << "]\npassword = geheim\n";
+    std::string errors, warnings;
+    ASSERT_TRUE(server_load(&daemon, &errors, &warnings)) << errors;
+    server_begin(&daemon);
+    server_peer_opened(&daemon, 4, "mgmtctl-9", {"user 7", false});
+    action(4, ACTION_ADD_INTEREST, {{"event_name", {bn_type_name, EVENT_CONFIG_CHANGE}}});
+    EXPECT_EQ(code(), 0u);
+    asker = 4;
+    const auto refused = [&] {
+        EXPECT_EQ(message(), "user 7 may look, but not change anything");
+        return code() == LC_BAD_LOGIN;
+    };
+    for (const uint32_t flags : {0u, uint32_t{bn_cf_check_only}}) {
+        (void)set({{bn_set_modify, GROUP + "/password", "geheim"}}, flags);
+        EXPECT_TRUE(refused()) << "nor a check, which would tell whether the password is right";
+    }
+    for (const char *name : {ACTION_CONFIRM, "/mgmtd/process/actions/report", "/mgmtd/time/actions/zonechange"}) {
+        action(4, name, {});
+        EXPECT_TRUE(refused()) << name;
+    }
+    EXPECT_TRUE(give(4, make_event(EVENT_RAISE_ALARM, {{"alarm_type", {bn_type_str, "196638"}}})));
+    EXPECT_TRUE(refused());
+    EXPECT_TRUE(daemon.alarm_owners.empty());
+
+    asker = 3;
+    ASSERT_EQ(set({{bn_set_modify, GROUP + "/password", "secret"}}), 0u);
+    EXPECT_EQ(events(4), (std::vector<strings>{{GROUP + "/password=********>********"}}));
+    EXPECT_EQ(events(1), (std::vector<strings>{{GROUP + "/password=geheim>secret"}}));
+    const std::string one = NODE_COMMITS "/1/text";
+    for (const uint32_t peer_id : {3u, 4u})
+        for (const std::string &name : {GROUP + "/password", std::string(NODE_CONFIG_TEXT), one}) {
+            query(peer_id, name, bn_query_get);
+            ASSERT_EQ(found().size(), 1u) << name;
+            const bool shown = found()[0].find(name == one ? "geheim" : "secret") != std::string::npos;
+            EXPECT_EQ(shown, peer_id == 3) << found()[0];
+            EXPECT_EQ(found()[0].find("geheim before") != std::string::npos, peer_id == 3 && name != GROUP + "/password");
+        }
+    for (const char *node : {"/51/debug", "/debug_all"}) {
+        clear();
+        query(4, STATE + node, bn_query_get);
+        const bn_request_msg *asked = sent.back().request;
+        answer(1, asked->msg_id, last_node(asked)->node_id, 0,
+               {{STATE + node, {bn_type_str, "a: b\nWCCP password : geheim 0x67\nc"}}});
+        EXPECT_EQ(found(), strings{STATE + node + "=a: b\nWCCP password : ********\nc"});
+    }
+}
+
 TEST_F(Mgmtd, AStartTidiesUpAndReportsWhatItCannotRefuse) {
     const std::string left = daemon.file.path + ".unfinished";
     daemon.facility_file = std::string(file) + "/new/facility";
@@ -707,9 +888,9 @@ TEST_F(Mgmtd, AWalkOfAllGroupsGoesGroupByGroup) {
     EXPECT_EQ(code(), 0u);
 
     const std::vector<event_field> large = {{STATE + "/1/debug", {bn_type_str, std::string(9 << 20, 'x')}}};
-    const auto start = [&](uint32_t asker) {
+    const auto start = [&](uint32_t client) {
         clear();
-        query(asker, STATE, bn_query_iterate, bn_qf_subtree);
+        query(client, STATE, bn_query_iterate, bn_qf_subtree);
         EXPECT_EQ(answer_last({group(1), group(2), group(3)}), STATE + " 0");
     };
     start(3);
@@ -717,11 +898,11 @@ TEST_F(Mgmtd, AWalkOfAllGroupsGoesGroupByGroup) {
     EXPECT_EQ(answer_last(large), STATE + "/2" + whole);
     EXPECT_EQ(code(), static_cast<uint32_t>(LC_NO_BUFFER_SPACE));
     EXPECT_EQ(message(), "The answer is larger than a message: ask for less");
-    for (uint32_t asker = 10; asker < 14; asker++) { // and all walks together are bounded
-        server_peer_opened(&daemon, asker, "mgmtctl-9");
-        start(asker);
+    for (uint32_t client = 10; client < 14; client++) { // and all walks together are bounded
+        server_peer_opened(&daemon, client, "mgmtctl-9");
+        start(client);
         EXPECT_EQ(answer_last(large), STATE + "/1" + whole);
-        EXPECT_EQ(code(), asker < 13 ? UINT32_MAX : static_cast<uint32_t>(LC_NO_SPACE));
+        EXPECT_EQ(code(), client < 13 ? UINT32_MAX : static_cast<uint32_t>(LC_NO_SPACE));
     }
     now += MONITOR_TIMEOUT_MS;
     clear();

@@ -2,6 +2,7 @@
 #include <deque>
 #include <fstream>
 
+#include <grp.h>
 #include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
@@ -264,6 +265,51 @@ TEST_F(Transport, ClientsThatCrowdLeaveTheDaemonsTheirPlaces) {
     ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &limit), 0);
     now += ACCEPT_PAUSE_MS;
     open(&waiting, "wccpd-4");
+}
+
+// Of the group, by the first of their groups or by another one: they have few places, and a daemon's name is
+// not for them.
+TEST_F(Transport, MembersOfTheGroupMayLook) {
+    const gid_t group = 1; // daemon
+    const auto as_user = [](gid_t first, gid_t other, const std::function<void()> &connects) {
+        const bool changed = setgroups(1, &other) == 0 && setegid(first) == 0 && seteuid(65534) == 0;
+        if (changed)
+            connects();
+        EXPECT_TRUE(seteuid(0) == 0 && setegid(0) == 0);
+        return changed;
+    };
+    if (getegid() != 0 || !as_user(65534, 65534, [] {}))
+        GTEST_SKIP() << "only one user is known here";
+    transport_close(&sockets);
+    std::string error;
+    sockets.place.viewers_group = "daemon";
+    ASSERT_TRUE(transport_listen(&sockets, &daemon, &error)) << error;
+    struct stat about;
+    ASSERT_EQ(stat("/tmp/gcl-socks/uds-provider-mgmtd", &about), 0);
+    EXPECT_EQ(about.st_mode & 07777, 0660u);
+    EXPECT_EQ(about.st_gid, group);
+
+    std::deque<raw_client> viewers;
+    const auto open_as = [&](gid_t first, gid_t other) -> raw_client & {
+        as_user(first, other, [&] { viewers.emplace_back(); });
+        pump(&viewers.back());
+        return viewers.back();
+    };
+    EXPECT_EQ(number_at(open_as(65534, group).got, 78), group) << "a client compares it with the file's";
+    viewers.back().put(greeting_response("mgmtctl-1", 65534) + open_service(2));
+    pump();
+    EXPECT_FALSE(daemon.peers.begin()->second.owner.may_change);
+    open_as(group, 65534).put(greeting_response("wccpd-1", 65534));
+    pump(&viewers.back());
+    EXPECT_TRUE(viewers.back().closed);
+    chmod("/tmp/gcl-socks/uds-provider-mgmtd", 0666);
+    EXPECT_TRUE(open_as(65534, 65534).closed);
+    EXPECT_EQ(lines.back(), "session refused: user 65534");
+    for (size_t i = 1; i <= VIEWER_SESSIONS_MAX; i++)
+        EXPECT_EQ(open_as(group, 65534).closed, i == VIEWER_SESSIONS_MAX);
+    raw_client ours;
+    open(&ours, "mgmtctl-2");
+    EXPECT_TRUE(daemon.peers.rbegin()->second.owner.may_change);
 }
 
 TEST_F(Transport, TheSocketIsOursAlone) {

@@ -224,7 +224,7 @@ case_killed() {
             "$bin/mgmtd" --config $dir/conf --check || fail "the file is broken"
             start
             [ -z "$(find $dir -name "*unfinished" -o -name pending)" ] || fail "something is left over"
-            last=$(ctl history --json | jq -r "if length <= 50 then .[0].commit else 0 end")
+            last=$(ctl history --json | jq -r "if length <= 50 and all(.[]; .commit == 1 or .cause == \"set\") then .[0].commit else 0 end")
             [ -z "$(ctl diff "$last" || echo failed)" ] || fail "commit $last is not the configuration"
         done 2>/dev/null
         ! grep "can.t be" $dir/out || fail "an entry is broken"

@@ -178,7 +178,7 @@ static lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
 
 // --- Opening
 
-static const char *const OWNER_ONLY = "only root and the user that mgmtd runs as may use it";
+static const char *const ALLOWED = "only root, the user that mgmtd runs as and the group wccpd may use it";
 
 // What the library reports as one error, checked before it makes a directory and a socket of its own.
 static bool somebody_listens(std::string *out_reason) {
@@ -186,8 +186,8 @@ static bool somebody_listens(std::string *out_reason) {
     struct stat about = {};
     if (stat(path.c_str(), &about) != 0 && (errno == ENOENT || errno == ENOTDIR))
         return fail(out_reason, "mgmtd is not running (nothing listens at " + path + ")");
-    if (access(path.c_str(), W_OK) != 0 || access(GCL_SOCKET_DIRECTORY, W_OK) != 0)
-        return fail(out_reason, path + ": " + strerror(errno) + "; " + OWNER_ONLY);
+    if (access(path.c_str(), W_OK) != 0)
+        return fail(out_reason, path + ": " + strerror(errno) + "; " + ALLOWED);
     if (about.st_uid != 0 && about.st_uid != geteuid())
         return fail(out_reason, path + " belongs to user " + std::to_string(about.st_uid) +
                                     "; only root's mgmtd and our own user's are trusted");
@@ -201,7 +201,10 @@ static lc_status make_instance(ctl_session *self) {
     CHECK_QUIET(bn_set_global_callback_set_response_msg(self->instance, take_response, self));
     CHECK_QUIET(bn_set_global_callback_action_response_msg(self->instance, take_response, self));
     CHECK_QUIET(bn_set_global_callback_event_request_msg(self->instance, take_event, self));
-    return gcl_session_client_new(self->instance, "mgmtctl", nullptr, 0, &self->session);
+    // The kernel names the socket: those who may only look can't make one in mgmtd's directory.
+    const sockaddr unnamed = {AF_UNIX, ""};
+    return gcl_session_client_new(self->instance, "mgmtctl", &unnamed, sizeof unnamed.sa_family,
+                                  &self->session);
 }
 
 static bool connect_to_mgmtd(ctl_session *self, std::string *out_reason) {

@@ -15,6 +15,7 @@
 #include "peers/mgmtd/change_plan.h"
 #include "peers/mgmtd/file_replace.h"
 #include "peers/mgmtd/server.h"
+#include "peers/nodes/secrets.h"
 
 // --- Events
 
@@ -44,6 +45,23 @@ static std::vector<event_changes> events_for(const peer &who, std::span<const ch
     return out;
 }
 
+static bn_request_msg *make_event_for(const server *self, uint32_t peer_id, const event_changes &event) {
+    const auto who = self->peers.find(peer_id);
+    if (who == self->peers.end() || who->second.owner.may_change)
+        return make_change_event(event);
+    change_list hidden;
+    event_changes shown;
+    hidden.reserve(event.size());
+    for (const node_change *change : event) {
+        hidden.push_back(*change);
+        for (std::optional<node_value> *value : {&hidden.back().before, &hidden.back().after})
+            if (*value)
+                (*value)->text = hidden_value(change->name.text(), (*value)->text);
+        shown.push_back(&hidden.back());
+    }
+    return make_change_event(shown);
+}
+
 static void send_change_events(server *self, const node_tree &before, const commit_result &commit) {
     wccpd_plan plan = plan_for_wccpd(before, self->tree, commit);
     for (change_list &changes : plan.events)
@@ -62,7 +80,7 @@ static void send_change_events(server *self, const node_tree &before, const comm
         for (const node_name &root : plan.recreated)
             self->say("service group " + root.parts.back() + " is deleted and created again in wccpd");
     for (const auto &[id, event] : events) {
-        const owned_request msg(make_change_event(event));
+        const owned_request msg(make_event_for(self, id, event));
         (void)server_send_request(self, id, msg.pointer);
     }
 }

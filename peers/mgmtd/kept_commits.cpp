@@ -15,6 +15,7 @@
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
+#include "peers/nodes/secrets.h"
 
 static constexpr int64_t RETRY_MS = 60000; // of a return that failed, as when the disk is full
 
@@ -47,16 +48,31 @@ void server_show_commits(server *self) {
     }
 }
 
-bool server_config_text(const server *self, const node_name &name, node_value *out) {
-    static const node_name present = parsed_name(NODE_CONFIG_TEXT), kept = parsed_name(NODE_COMMITS "/*/text");
+static std::string hidden_text(node_tree tree) {
+    hide_secrets(&tree.set);
+    return config_format(tree, {});
+}
+
+static bool kept_text(const server *self, const node_name &name, bool hide, std::string *out) {
     std::string number, reason;
-    *out = {bn_type_str, ""};
-    if (name == present) {
-        out->text = config_format(self->tree, self->comments);
+    config_text text;
+    if (!canonical_text(bn_type_uint32, name.parts[name.parts.size() - 2], &number) ||
+        !history_text(self->kept, static_cast<uint32_t>(std::stoul(number)), out, &reason))
+        return false;
+    if (!hide)
         return true;
-    }
-    return matches(kept, name) && canonical_text(bn_type_uint32, name.parts[name.parts.size() - 2], &number) &&
-           history_text(self->kept, static_cast<uint32_t>(std::stoul(number)), &out->text, &reason);
+    const bool good = config_parse_part(*out, "", &text);
+    *out = hidden_text(text.tree);
+    return good;
+}
+
+bool server_config_text(const server *self, const node_name &name, bool hide, node_value *out) {
+    static const node_name present = parsed_name(NODE_CONFIG_TEXT), kept = parsed_name(NODE_COMMITS "/*/text");
+    *out = {bn_type_str, ""};
+    if (matches(kept, name))
+        return kept_text(self, name, hide, &out->text);
+    out->text = hide ? hidden_text(self->tree) : config_format(self->tree, self->comments);
+    return name == present;
 }
 
 // --- Keeping

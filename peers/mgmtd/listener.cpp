@@ -22,6 +22,7 @@
 
 #include <dirent.h>
 #include <fcntl.h>
+#include <grp.h>
 #include <sys/file.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -152,6 +153,16 @@ void listener_tidy(const listener *self) {
 
 // --- The socket
 
+static void admit_viewers(listener *self) {
+    if (self->viewers == static_cast<gid_t>(-1))
+        return;
+    if (chown(self->path.c_str(), static_cast<uid_t>(-1), self->viewers) == 0 &&
+        chmod(self->path.c_str(), 0660) == 0)
+        return;
+    self->say("group " + self->viewers_group + " can't be let in: " + strerror(errno));
+    self->viewers = static_cast<gid_t>(-1);
+}
+
 static bool open_socket(listener *self, std::string *out_error) {
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
@@ -167,8 +178,11 @@ static bool open_socket(listener *self, std::string *out_error) {
     const mode_t before = umask(0177);
     const int bound = bind(self->socket, reinterpret_cast<sockaddr *>(&address), sizeof address);
     umask(before);
+    if (bound == 0)
+        admit_viewers(self);
     if (bound != 0 || listen(self->socket, BACKLOG) != 0 || lstat(address.sun_path, &about) != 0)
         return fail(out_error, self->path);
+    self->group = about.st_gid;
     self->device = about.st_dev;
     self->inode = about.st_ino;
     return true;
@@ -188,6 +202,8 @@ static void close_place(listener *self) {
 
 bool listener_open(listener *self, std::string *out_error) {
     self->path = provider_path();
+    if (const group *viewers = getgrnam(self->viewers_group.c_str()))
+        self->viewers = viewers->gr_gid;
     return take_lock_file(self, out_error) && open_place(self, out_error);
 }
 

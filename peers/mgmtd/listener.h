@@ -7,6 +7,7 @@
 
 #include <sys/types.h>
 
+constexpr const char *VIEWERS_GROUP = "wccpd"; // of the users who may look, but not change
 constexpr const char *MGMTD_LOCK_FILE = "/var/run/mgmtd.lock"; // of root's mgmtd
 
 struct listener {
@@ -14,6 +15,9 @@ struct listener {
     int lock = -1, directory = -1;
     int socket = -1; // non-blocking
     std::string path;
+    std::string viewers_group = VIEWERS_GROUP;
+    gid_t viewers = static_cast<gid_t>(-1); // may connect; -1: there is no such group
+    gid_t group = 0;                        // of the socket's file
     dev_t device = 0; // of the socket's file
     ino_t inode = 0;
     std::string complaint; // the last one, which isn't repeated

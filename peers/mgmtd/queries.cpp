@@ -19,6 +19,7 @@
 #include "mgmt/gcl.h"
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
+#include "peers/nodes/secrets.h"
 
 namespace {
 struct state_source {
@@ -125,13 +126,21 @@ static void refuse_query(server *self, const pending_query &query, uint32_t code
         (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
 }
 
+static bool is_shown_all(const server *self, uint32_t asker) {
+    const auto found = self->peers.find(asker);
+    return found != self->peers.end() && found->second.owner.may_change;
+}
+
 // What mgmtd answers itself. False when that is more than a message holds: the query has been refused.
 static bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
     size_t bytes = query.gathered_bytes;
-    const auto found_asker = self->peers.find(query.asker);
-    const peer asker = found_asker == self->peers.end() ? peer{} : found_asker->second;
-    const auto append = [&](uint32_t id, const node_name &name, const node_value &value) {
+    const auto asker = self->peers.find(query.asker);
+    const bool runs_groups = asker != self->peers.end() && server_runs_groups(asker->second);
+    const bool all = is_shown_all(self, query.asker);
+    const auto append = [&](uint32_t id, const node_name &name, node_value value) {
         const std::string text = name.text();
+        if (!all)
+            value.text = hidden_value(text, value.text);
         bytes += text.size() + value.text.size() + ANSWER_NODE_BYTES;
         if (bytes > GCL_FRAME_MAX)
             refuse_query(self, query, LC_NO_BUFFER_SPACE, BN_TOO_LARGE);
@@ -142,16 +151,16 @@ static bool append_own_answers(server *self, const pending_query &query, bn_resp
     for (const asked_node &asked : query.asked) {
         node_name name;
         node_list found;
+        node_value made;
         if (!parse_node_name(asked.name, &name))
             continue;
         answer_here(self, asked.subop, asked.flags, name, &found);
         for (const auto *entry : found)
-            if (!append(asked.id, entry->first, server_runs_groups(asker)
-                                                    ? server_value_for_wccpd(self, entry->first, entry->second)
-                                                    : entry->second))
+            if (!append(asked.id, entry->first,
+                        runs_groups ? server_value_for_wccpd(self, entry->first, entry->second)
+                                    : entry->second))
                 return false;
-        node_value made;
-        if (asked.subop == bn_query_get && server_config_text(self, name, &made) &&
+        if (asked.subop == bn_query_get && server_config_text(self, name, !all, &made) &&
             !append(asked.id, name, made))
             return false;
     }
@@ -309,6 +318,17 @@ void server_answer_without(server *self, pending_query query, uint32_t code, con
     end_part(self, std::move(query), code, why);
 }
 
+// A dump of wccpd's has passwords in it. One that can't be made anew is left out.
+static void hide_in(bn_binding **inout) {
+    const std::string name = name_of(*inout);
+    const node_value value = value_of(*inout);
+    const std::string hidden = hidden_value(name, value.text);
+    if (hidden == value.text)
+        return;
+    (void)bn_binding_free(inout);
+    *inout = make_binding(name, {value.type, hidden});
+}
+
 // Takes over the daemon's bindings. False when a limit is met: the query has been refused.
 static bool gather(server *self, pending_query *query, bn_response_msg *msg, size_t bytes) {
     query->gathered_bytes += bytes;
@@ -324,10 +344,13 @@ static bool gather(server *self, pending_query *query, bn_response_msg *msg, siz
     }
     if (made)
         query->gathered.reset(made, bn_release_response);
+    const bool all = is_shown_all(self, query->asker);
     for (uint32_t i = 0; i < bn_response_per_node_array_length_quick(msg->nodes); i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
         if (!node || !node->binding)
             continue;
+        if (!all)
+            hide_in(&node->binding);
         const auto asked = query->node_ids.find(node->node_id);
         if (asked != query->node_ids.end())
             (void)bn_query_response_msg_append_binding_takeover(query->gathered.get(), &node->binding,

@@ -5,8 +5,8 @@
 // nothing waits for it. What is sent goes to the transport's queue. Queries are in queries.cpp, commits in
 // commits.cpp, alarms and state events in reports.cpp.
 //
-// Whoever has reached the socket is trusted: the transport lets only root and its own user in. What comes is
-// bounded by the frame that brought it all the same.
+// The transport says of a session whether its user may change anything. One who may not gets answers, without
+// passwords, and events. What comes is bounded by the frame that brought it.
 #include "peers/mgmtd/server.h"
 
 #include <algorithm>
@@ -194,9 +194,10 @@ static action_answer confirm(server *self, uint32_t peer_id, const std::vector<e
 static const struct {
     const char *name;
     action_answer (*run)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+    bool looks = false; // changes nothing
 } actions[] = {
-    {ACTION_ADD_INTEREST, add_interest},
-    {ACTION_REMOVE_INTEREST, remove_interest},
+    {ACTION_ADD_INTEREST, add_interest, true},
+    {ACTION_REMOVE_INTEREST, remove_interest, true},
     {ACTION_CONFIRM, confirm},
     {"/mgmtd/process/actions/report", report_process},
     {"/mgmtd/time/actions/zonechange", report_zone},
@@ -206,10 +207,20 @@ static std::string text_of(const tstring *text) {
     return text ? ts_str(text) : "";
 }
 
+// True when the session may change things; otherwise the request has been answered.
+static bool may_change(server *self, uint32_t peer_id, const bn_request_msg *msg) {
+    const peer_owner &owner = self->peers[peer_id].owner;
+    if (!owner.may_change)
+        answer(self, peer_id, msg, LC_BAD_LOGIN, owner.user + " may look, but not change anything");
+    return owner.may_change;
+}
+
 static void take_action(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     const std::string name = text_of(msg->text);
     for (const auto &action : actions)
         if (name == action.name) {
+            if (!action.looks && !may_change(self, peer_id, msg))
+                return;
             const action_answer result = action.run(self, peer_id, fields_of(msg));
             answer(self, peer_id, msg, result.code, result.message);
             return;
@@ -238,6 +249,8 @@ static commit_order order_of(const peer &who, const bn_request_msg *msg) {
 static void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     constexpr uint32_t known = bn_cf_check_only | bn_cf_ends_wait | ~0u << bn_cf_minutes_shift;
     std::vector<set_step> steps;
+    if (!may_change(self, peer_id, msg))
+        return;
     if (msg->flags & ~known) {
         answer(self, peer_id, msg, LC_NOT_IMPLEMENTED, "The request has commit flags that are not known");
         return;
@@ -355,6 +368,8 @@ static bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const t
         take_action(self, peer_id, msg.pointer);
         return true;
     case bn_msg_event:
+        if (!may_change(self, peer_id, msg.pointer))
+            return true;
         server_take_event(self, peer_id, text_of(msg.pointer->text), fields_of(msg.pointer));
         answer(self, peer_id, msg.pointer, 0, "");
         return true;

@@ -187,8 +187,9 @@ std::string server_wait_for_confirmation(const server *self);
 commit_result server_confirm(server *self, const std::string &who);
 // A commit that nobody has confirmed in time is undone. Gives the time of the next look, or -1.
 int64_t server_return_unconfirmed(server *self);
-// The texts of configurations, which are made when they are asked for.
-bool server_config_text(const server *self, const node_name &name, node_value *out);
+// The texts of configurations, which are made when they are asked for; with `hide` without passwords, and
+// without comments, in which there may be some.
+bool server_config_text(const server *self, const node_name &name, bool hide, node_value *out);
 // Makes `next` the configuration, and sends what has changed.
 void server_take_over(server *self, node_tree next, const commit_result &commit);
 // Bypass entries whose time is over are deleted by a commit. Gives the time of the next look, or -1.

@@ -5,9 +5,10 @@
 // client makes mgmtd hold is therefore bounded by GCL_FRAME_MAX in and QUEUE_MAX_BYTES out. A client that
 // doesn't read never stops the others: nothing here blocks.
 //
-// The kernel says who a client is; only root and our own user are let in. Clients that crowd the socket leave
-// the daemons their places: the name in the greeting decides, and whoever takes long over the greeting gives
-// way to a new connection.
+// The kernel says who a client is. Root and our own user may do everything, the members of a group may look;
+// nobody else is let in. Clients that crowd the socket leave the daemons their places: the name in the greeting
+// decides, and whoever takes long over the greeting gives way to a new connection. Those who may only look
+// have few places, and the name of a daemon is not for them.
 #include "peers/mgmtd/transport.h"
 
 #include <algorithm>
@@ -130,7 +131,7 @@ static void send_greeting(transport *self, session *client) {
     const std::string name = std::string(PROVIDER_NAME) + "-" + std::to_string(getpid());
     strlcpy(greeting.name, name.c_str(), sizeof greeting.name);
     greeting.uid = to_be32(geteuid());
-    greeting.gid = to_be32(getegid());
+    greeting.gid = to_be32(self->place.group); // a client compares it with the file's
     const passwd *entry = getpwuid(geteuid());
     strlcpy(greeting.user, entry ? entry->pw_name : "", sizeof greeting.user);
     send_admin(self, client, GCL_ADMIN_GREETING, greeting);
@@ -173,6 +174,10 @@ static bool take_greeting_response(transport *self, session *client, std::string
     }
     const bool allowed = has_place(self, name);
     client->name = name;
+    if (is_daemon(name) && !client->owner.may_change) {
+        end_session(self, client, "refused, " + client->owner.user + " is no daemon's");
+        return false;
+    }
     if (!allowed) {
         end_session(self, client, "refused, too many");
         return false;
@@ -207,7 +212,7 @@ static bool take_open_service(transport *self, uint32_t id, session *client, std
         self->owner->say("session of " + client->name + ": service " + std::to_string(service) + " refused");
     } else if (client->stage == session::greeted) {
         client->stage = session::open;
-        server_peer_opened(self->owner, id, client->name);
+        server_peer_opened(self->owner, id, client->name, client->owner);
     }
     return true;
 }
@@ -290,6 +295,44 @@ static bool make_room(transport *self) {
     return false;
 }
 
+// --- Who it is
+
+static bool is_member(int fd, const ucred &who, gid_t group) {
+    gid_t groups[256];
+    socklen_t length = sizeof groups;
+    if (group == static_cast<gid_t>(-1))
+        return false;
+    if (who.gid == group)
+        return true;
+    // Somebody in more groups than fit is let in by that one alone.
+    return getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, groups, &length) == 0 &&
+           std::find(groups, groups + length / sizeof *groups, group) != groups + length / sizeof *groups;
+}
+
+// Names are not looked up: that may ask the network, and everybody would wait for it.
+static std::string name_of_user(uid_t uid) {
+    const passwd *entry = uid != 0 && uid == geteuid() ? getpwuid(uid) : nullptr;
+    return uid == 0 ? "root" : entry ? entry->pw_name : "user " + std::to_string(uid);
+}
+
+// Why a connection is refused, or "".
+static std::string identify(const transport *self, int fd, session *out) {
+    ucred who{};
+    socklen_t length = sizeof who;
+    if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &who, &length) != 0)
+        return "nobody knows whose it is";
+    out->uid = who.uid;
+    out->owner = {name_of_user(who.uid), who.uid == 0 || who.uid == geteuid()};
+    if (out->owner.may_change)
+        return "";
+    if (!is_member(fd, who, self->place.viewers))
+        return out->owner.user;
+    const auto viewers = std::ranges::count_if(self->sessions, [](const auto &each) {
+        return !each.second.ended && !each.second.owner.may_change;
+    });
+    return viewers < static_cast<ptrdiff_t>(VIEWER_SESSIONS_MAX) ? "" : "too many of those who may only look";
+}
+
 static void accept_session(transport *self) {
     const int fd = accept4(self->place.socket, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
     if (fd < 0) {
@@ -299,22 +342,20 @@ static void accept_session(transport *self) {
         return;
     }
     listener_tidy(&self->place);
-    ucred credentials{};
-    socklen_t length = sizeof credentials;
-    const bool known = getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &credentials, &length) == 0;
-    const bool trusted = known && (credentials.uid == 0 || credentials.uid == geteuid());
-    if (!trusted || !make_room(self)) {
-        self->owner->say(trusted ? "session refused: too many"
-                                 : "session refused: user " + std::to_string(credentials.uid));
+    session client{};
+    std::string refusal = identify(self, fd, &client);
+    if (refusal.empty() && !make_room(self))
+        refusal = "too many";
+    if (!refusal.empty()) {
+        self->owner->say("session refused: " + refusal);
         close(fd);
         return;
     }
-    session &client = self->sessions[self->next_id++];
     client.fd = fd;
-    client.uid = credentials.uid;
     client.sequence = GCL_SEQUENCE_PROVIDER;
     client.open_by_ms = self->owner->now_ms() + OPENING_MAX_MS;
-    send_greeting(self, &client);
+    session &kept = self->sessions[self->next_id++] = std::move(client);
+    send_greeting(self, &kept);
 }
 
 // The end of a session may be reported to others, and end theirs.

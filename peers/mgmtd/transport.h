@@ -14,6 +14,7 @@
 
 constexpr size_t SESSIONS_MAX = 64;
 constexpr size_t CLIENT_SESSIONS_MAX = 56; // the other places are kept for the appliance's daemons
+constexpr size_t VIEWER_SESSIONS_MAX = 12;
 // For a client that doesn't read. An answer that doesn't fit is refused; for other frames its session ends.
 constexpr size_t QUEUE_MAX_BYTES = 32u << 20;
 constexpr uint32_t OPENING_FRAME_MAX = 4096; // before the service is open
@@ -24,6 +25,7 @@ constexpr int64_t ACCEPT_PAUSE_MS = 1000; // when there is no descriptor for a c
 struct session {
     int fd;
     uint32_t uid;
+    peer_owner owner;
     enum { greeting_sent, greeted, open } stage = greeting_sent;
     std::string name; // from the greeting response
     std::string unread;
