@@ -134,6 +134,7 @@ bool command(uint16_t code, uint16_t id) {
     mailbox->remote_ip = ROUTER;
     mailbox->fmst_index = WCCP_NO_INDEX;
     mailbox->command = code;
+    wccp_wake_tunneld();
     for (const double end = now() + LIMIT; mailbox->command != 0;) {
         if (now() > end)
             return false;

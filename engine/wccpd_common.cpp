@@ -9,7 +9,7 @@
 // still pending and tunneld may be reading it; it is written last, with release order, and the answer is
 // looked for with acquire order.
 //
-// The wait is a poll of one millisecond, two thousand times. Between two polls, when there is no answer yet,
+// A command that has been written wakes tunneld by a datagram. The wait is a poll of one millisecond, two thousand times. Between two polls, when there is no answer yet,
 // it is a cancellation point: an answer that has come is taken, and a thread that is cancelled before
 // releases the mutex on its way out and withdraws an add, as after a time-out, since nobody would know the
 // tunnel that came of it.
@@ -164,6 +164,7 @@ void write_command(wccp_tunnel_mailbox *mailbox, uint16_t code, const mailbox_in
         mailbox_put(mailbox->fmst_index, inputs->fmst_index);
     }
     mailbox->command.store(code, std::memory_order_release);
+    wccp_wake_tunneld();
 }
 
 // A command that is being waited for. However the wait ends, an add without an answer is withdrawn; the other

@@ -13,8 +13,14 @@
 #include "platform/tunnel_mailbox.h"
 
 #include <sys/shm.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstring>
 
 #include "runtime/cmem.h"
+#include "runtime/guards.h"
 #include "runtime/logging.h"
 
 wccp_tunnel_mailbox *wccp_mailbox;
@@ -45,6 +51,19 @@ bool wccp_attach_mailbox() {
 // Both sides end a command by an exchange: exactly one of them finds it in the slot.
 bool wccp_withdraw_command(wccp_tunnel_mailbox *mailbox) {
     return mailbox->command.exchange(MAILBOX_IDLE, std::memory_order_acq_rel) != MAILBOX_IDLE;
+}
+
+// A socket for each time: a tunneld that has been restarted has bound a new one, and commands are rare.
+void wccp_wake_tunneld() {
+    const cancel_off_guard whole;
+    const int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+    if (fd < 0)
+        return;
+    sockaddr_un to = {};
+    to.sun_family = AF_UNIX;
+    memcpy(to.sun_path, WCCP_WAKE_UP_PATH, sizeof WCCP_WAKE_UP_PATH);
+    (void)sendto(fd, "", 1, MSG_DONTWAIT | MSG_NOSIGNAL, reinterpret_cast<const sockaddr *>(&to), sizeof to);
+    close(fd);
 }
 
 uint16_t wccp_get_tunnel_command() {

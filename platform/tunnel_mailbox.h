@@ -10,6 +10,8 @@
 #include <cstdint>
 
 constexpr const char *WCCP_MAILBOX_NAME = "wccpd_mailbox";
+// tunneld's datagram socket (AF_UNIX): a datagram there, of whatever content, says that a command is given.
+constexpr char WCCP_WAKE_UP_PATH[] = "/run/tunneld/wake-up";
 constexpr uint32_t WCCP_POLICY_GROUPS = 65536;
 constexpr uint32_t WCCP_NO_INDEX = 0xFFFFFFFF;
 enum : uint16_t {
@@ -68,6 +70,9 @@ bool wccp_attach_mailbox();
 // wccpd's side: takes back an add that it does not wait for any longer. False when tunneld has answered it;
 // the answer is then in the outputs.
 bool wccp_withdraw_command(wccp_tunnel_mailbox *mailbox);
+// wccpd's side: wakes a tunneld that waits for a command, after `command` has been written. Neither blocks nor
+// fails nor is a cancellation point: a tunneld that isn't woken finds the command by polling.
+void wccp_wake_tunneld();
 
 // tunneld's side. Without the block these give the defaults or do nothing.
 uint16_t wccp_get_tunnel_command();

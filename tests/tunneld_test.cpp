@@ -294,6 +294,7 @@ std::string sorting_maps() {
 
 uint32_t order(uint16_t code, uint16_t id, uint32_t remote) {
     give(code, id, remote);
+    wccp_wake_tunneld();
     for (int i = 0; i < 500 && mailbox->command != 0; i++)
         std::this_thread::sleep_for(10ms);
     EXPECT_EQ(mailbox->command, 0) << "not answered";
@@ -338,7 +339,21 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     close(held.fd);
     EXPECT_EQ(order(MAILBOX_ADD_TUNNEL, 3, 0x0A000002), again);
     EXPECT_EQ(sorting_maps(), maps);
+    // More wake-ups than its socket takes hold nobody up, and it answers long before it would look by itself.
+    const int free_descriptor = dup(0);
+    for (int i = 0; i < 1000; i++)
+        wccp_wake_tunneld();
+    const int64_t began = lt_monotonic_ms();
+    for (int i = 0; i < 10; i++)
+        order(MAILBOX_L2_RETURN, 0, 0);
+    EXPECT_LT(lt_monotonic_ms() - began, 1000);
     EXPECT_EQ(end_process(daemon, SIGTERM), 0);
+    EXPECT_FALSE(std::filesystem::exists(WCCP_WAKE_UP_PATH));
+    wccp_wake_tunneld(); // nobody
+    close(free_descriptor);
+    const int still_free = dup(0);
+    EXPECT_EQ(still_free, free_descriptor);
+    close(still_free);
     EXPECT_FALSE(if_nametoindex("wccp0") || if_nametoindex("wccp1"));
     EXPECT_EQ(sorting_maps().find("goto"), std::string::npos);
     EXPECT_FALSE(std::filesystem::exists(WCCPD_FILE));

@@ -7,10 +7,13 @@
 // an id whose delete was lost, replaces what was there.
 #include "peers/tunneld/commands.h"
 
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstring>
 #include <ctime>
 
 #include <nlohmann/json.hpp>
@@ -276,8 +279,36 @@ void print_line(const command_desk &desk, const nlohmann::ordered_json &line, co
     fflush(desk.out);
 }
 
-int64_t mailbox_pause_ms(bool attached, int64_t quiet_ms) {
-    if (!attached)
+int open_wake_up() {
+    const int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+    sockaddr_un own = {};
+    own.sun_family = AF_UNIX;
+    memcpy(own.sun_path, WCCP_WAKE_UP_PATH, sizeof WCCP_WAKE_UP_PATH);
+    unlink(WCCP_WAKE_UP_PATH);
+    if (fd >= 0 && bind(fd, reinterpret_cast<const sockaddr *>(&own), sizeof own) == 0)
+        return fd;
+    LC_LOG(LC_LOG_WARNING, "%s: %m: commands are looked for instead", WCCP_WAKE_UP_PATH);
+    if (fd >= 0)
+        close(fd);
+    return -1;
+}
+
+void take_wake_ups(int fd) {
+    char byte;
+    while (recv(fd, &byte, sizeof byte, 0) >= 0)
+        continue;
+}
+
+void close_wake_up(int *inout_fd) {
+    if (*inout_fd < 0)
+        return;
+    unlink(WCCP_WAKE_UP_PATH);
+    close(*inout_fd);
+    *inout_fd = -1;
+}
+
+int64_t mailbox_pause_ms(bool attached, bool is_woken, int64_t quiet_ms) {
+    if (!attached || is_woken)
         return 250;
     if (quiet_ms < 1000)
         return 1;

@@ -72,8 +72,15 @@ void watch_wccpd(command_desk *desk, int64_t now_ms);
 void drop_unordered(command_desk *desk, int64_t now_ms);
 // At an orderly end, after which there are no tunnels.
 void forget_wccpd();
-// The time to the next look at the mailbox, by the time since the last command or the start.
-int64_t mailbox_pause_ms(bool attached, int64_t quiet_ms);
+// The socket by which wccpd wakes this process (platform/tunnel_mailbox.h), in the place of one that a killed
+// tunneld has left; -1, with a line in the log, when there can't be one. The caller holds the lock that keeps
+// other tunnelds away.
+int open_wake_up();
+void take_wake_ups(int fd);
+void close_wake_up(int *inout_fd);
+// The time to the next look at the mailbox, by the time since the last command or the start. `is_woken`: a
+// command comes with a wake-up, and looking for one is a second chance.
+int64_t mailbox_pause_ms(bool attached, bool is_woken, int64_t quiet_ms);
 void print_roles(command_desk *desk);
 // One line to `out`: the object, or the text.
 void print_line(const command_desk &desk, const nlohmann::ordered_json &line, const std::string &text);

@@ -1,8 +1,9 @@
 // The loop of the program and what it decides.
 //
-// The mailbox is looked at each millisecond for a second after a command, since more follow, less often the
-// longer it has been quiet, and four times a second while there is none. wccpd waits for two seconds, of
-// which the longest pause takes a small part. Everything that is due now and then is done on the same timer.
+// wccpd wakes this process by a datagram when it has put a command into the mailbox. In case one is lost the
+// mailbox is looked at four times a second as well: wccpd waits for two seconds. Without a socket for wake-ups
+// it is looked at each millisecond for a second after a command, since more follow, and less often later.
+// Everything that is due now and then is done on the same timer.
 //
 // A tunneld that is killed leaves its interfaces, routes and rules, and the next one takes them over. Until
 // it has read the configuration, however long that takes, it makes and removes tunnels as it is ordered to,
@@ -270,8 +271,15 @@ void look_at_mailbox(int, short, void *data) {
         if (daemon->management)
             mgmt_link_ask_routers(daemon->management); // a new tunnel may mean a new router
     }
-    LOG_STATUS(loop_event_set_timer(daemon->mailbox_timer,
-                                    mailbox_pause_ms(daemon->desk.attached, now - daemon->last_command_ms)));
+    const int64_t pause =
+        mailbox_pause_ms(daemon->desk.attached, daemon->wake_up >= 0, now - daemon->last_command_ms);
+    LOG_STATUS(loop_event_set_timer(daemon->mailbox_timer, pause));
+}
+
+// The wake-up is taken first: one that comes during the look means another.
+void be_woken(int fd, short, void *data) {
+    take_wake_ups(fd);
+    look_at_mailbox(-1, 0, data);
 }
 
 lc_status take_signal(int number, short, void *, lew *loop) {
@@ -342,6 +350,11 @@ bool start_parts(tunneld *daemon) {
     if (lew_init(&daemon->loop) != LC_OK || lew_get_event_context(daemon->loop, &context) != LC_OK ||
         loop_event_new(context, look_at_mailbox, daemon, &daemon->mailbox_timer) != LC_OK)
         return false;
+    daemon->wake_up = open_wake_up();
+    if (daemon->wake_up >= 0 &&
+        (loop_event_new(context, be_woken, daemon, &daemon->wake_up_event) != LC_OK ||
+         loop_event_set_fd(daemon->wake_up_event, daemon->wake_up, LOOP_READ) != LC_OK))
+        return false;
     static lew_event *slots[3];
     size_t taken = 0;
     for (const int number : {SIGTERM, SIGINT, SIGHUP})
@@ -399,6 +412,9 @@ void end_parts(tunneld *daemon) {
     }
     if (daemon->mailbox_timer)
         loop_event_free(&daemon->mailbox_timer);
+    if (daemon->wake_up_event)
+        loop_event_free(&daemon->wake_up_event);
+    close_wake_up(&daemon->wake_up);
     if (daemon->loop) {
         (void)lew_delete_all_events(daemon->loop);
         (void)lew_deinit(&daemon->loop);

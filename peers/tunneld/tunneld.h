@@ -42,7 +42,8 @@ struct tunneld {
     std::string lack;         // what the kernel lacks for sorting packets, or ""
 
     lew *loop = nullptr;
-    loop_event *mailbox_timer = nullptr;
+    loop_event *mailbox_timer = nullptr, *wake_up_event = nullptr;
+    int wake_up = -1; // the socket, -1 for none
     mgmt_link *management = nullptr;
     health_monitor *health = nullptr;
 
