@@ -301,10 +301,8 @@ void add_outer_chains(content_maker &maker) {
     // GRE by its number: its name would be looked up in /etc/protocols, which not every system has.
     chain.rules = {"ip protocol != 47 accept",
                    "ip frag-off & 0x3fff != 0 counter name ip saddr . ip daddr map @count_fragments"};
-    nft_chain &input = maker.content.chains["outer_input"];
-    input.declaration = "type filter hook input priority -150; policy accept;";
-    if (maker.wanted.drop_outer_gre)
-        input.rules = {"ip protocol 47 ip daddr @local_ends drop"};
+    if (maker.wanted.drop_outer_gre) // the packet ring has them already: before they cost a route
+        chain.rules.push_back("ip daddr @local_ends drop");
     else // the user-space plane counts them itself
         chain.rules.push_back(format("ip daddr @local_ends ip saddr . ip daddr != @%s "
                                      "add @%s { ip saddr . ip daddr counter }",
