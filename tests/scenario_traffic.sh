@@ -204,6 +204,34 @@ case_accept() {
     finish a1
 }
 
+# While a group of its policy group has no router, new flows pass by the proxy, and those that it has go on. The same
+# when no wccpd says anything of roles.
+case_roles() {
+    start --forward gre --return gre
+    lab_router r2 10.0.0.2
+    proxied a1 10.0.0.101 '' '[/qv/wccpd/wccp/policy_grp/config/5]' name=blue "$(lab_group 51 10.0.0.1 policy_grp=5)" \
+        "$(lab_group 52 10.0.0.2 policy_grp=5)" "$(lab_intercept 51 ports=80)"
+    ready 51 a1
+    ready_role() { state_is a1 "$1" intercept ".[\"51\"].active == $2"; }
+    ready_role 20 true
+    lab_fetch c1 --size 1000 --requests 300 --pause 0.1 >"$LAB/kept" &
+    local kept=$! i
+    for i in 1 2; do
+        lab_ctl r2 stop >/dev/null
+        ready_role 30 false
+        fetches "$direct" --count 4
+        lab_ctl r2 resume >/dev/null
+        ready_role 30 true
+        fetches "$(by a1)" --count 4
+    done
+    wait $kept
+    jq -e "$(by a1)" "$LAB/kept" >/dev/null || die "not kept: $(cat "$LAB/kept")"
+    lab_stop a1 wccpd
+    ready_role 5 false
+    fetches "$direct" --count 4
+    finish a1
+}
+
 # tunneld killed again and again during transfers: each ends well or is reset, wccpd stays, and new fetches work.
 case_kills() {
     start --forward gre --return gre

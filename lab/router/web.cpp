@@ -215,6 +215,10 @@ static const char *connect_from(int fd, const fetch_options &options, uint32_t s
         return nullptr;
     return errno == EINPROGRESS ? "connect timeout" : errno == ECONNREFUSED ? "refused" : "connect";
 }
+static void pause_for(double seconds) {
+    if (seconds > 0)
+        usleep(static_cast<useconds_t>(seconds * 1e6));
+}
 static const char *talk(int fd, const fetch_options &options, fetched *out) {
     stream in = {fd, "", "send"};
     const bool post = options.upload > 0;
@@ -223,6 +227,8 @@ static const char *talk(int fd, const fetch_options &options, fetched *out) {
                                 (post ? "Content-Length: " + std::to_string(options.upload) + "\r\n" : "") +
                                 "\r\n";
     for (uint32_t i = 0; i < options.requests; i++) {
+        if (i > 0)
+            pause_for(options.pause);
         std::string head;
         if (!send_all(fd, request.data(), request.size()) || !send_body(fd, options.upload) ||
             !read_head(&in, &head))
@@ -279,8 +285,7 @@ static void fetch_many(const fetch_options &options, double began, tally *all) {
                 all->last_good = now;
             }
         }
-        if (options.pause > 0)
-            usleep(static_cast<useconds_t>(options.pause * 1e6));
+        pause_for(options.pause);
     }
 }
 
@@ -297,7 +302,7 @@ void add_fetch_options(CLI::App *app, fetch_options *options) {
     app->add_option("--upload", options->upload, "bytes posted instead");
     app->add_option("--timeout", options->timeout, "seconds of silence that a fetch survives");
     app->add_option("--seconds", options->seconds, "go on for so long, whatever --count says");
-    app->add_option("--pause", options->pause, "seconds after each fetch");
+    app->add_option("--pause", options->pause, "seconds after each request");
 }
 
 int run_fetch(const fetch_options &options) {
