@@ -1,5 +1,23 @@
-#include "daemon/wccpd_main.h"
+// No argument has an effect on the daemon. The two that ask what it is are answered.
+#include <cstdio>
+#include <cstring>
 
-int main() {
+#include "daemon/wccpd_main.h"
+#include "runtime/version.h"
+
+static const char HELP[] =
+    "Usage: wccpd\n"
+    "Makes this appliance a member of WCCP version 2 service groups. wccpd has no options of its own and no\n"
+    "configuration file: it asks mgmtd, which has to run, and logs to syslog.\n"
+    "  --help      this text\n"
+    "  --version   the version\n"
+    "SIGTERM, SIGINT and SIGHUP end it in order. See wccpd(8), mgmtctl(1) and mgmtd.conf(5).\n";
+
+int main(int argc, char **argv) {
+    const char *question = argc == 2 ? argv[1] : "";
+    if (strcmp(question, "--version") == 0)
+        return printf("wccpd %s\n", wccp_version()) < 0 || fflush(stdout) != 0;
+    if (strcmp(question, "--help") == 0)
+        return fputs(HELP, stdout) < 0 || fflush(stdout) != 0;
     return wccpd_main();
 }

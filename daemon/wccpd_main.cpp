@@ -11,7 +11,8 @@
 // needs the session, and the alarm session must exist before the engine can raise anything. m_daemon_status
 // alone says how far the start has come. Until it is WCCPD_READY, queries are dropped and changes of the
 // configuration are kept (wccpd_early_changes.h). A start that fails does not end the process, which sits in
-// its loop, never ready and ignoring changes, until a signal arrives.
+// its loop, never ready and ignoring changes, until a signal arrives; only without a privilege that it needs
+// it exits at once.
 //
 // The order of the exit: alarms are cleared while their session is open; then that session and its thread
 // end, the signal registrations are removed, the working session is closed, and the mailbox is reset. Groups
@@ -42,6 +43,7 @@
 #include "daemon/wccpd_config.h"
 #include "daemon/wccpd_early_changes.h"
 #include "daemon/wccpd_mgmt.h"
+#include "daemon/wccpd_service.h"
 #include "engine/wccp_alarm_client.h"
 #include "engine/wccp_host.h"
 #include "engine/wccp_mgr.h"
@@ -49,6 +51,7 @@
 #include "platform/file_utils.h"
 #include "platform/limits.h"
 #include "runtime/logging.h"
+#include "runtime/service_notify.h"
 #include "runtime/version.h"
 
 const char *const wccpd_program_name = "wccpd";
@@ -158,6 +161,10 @@ lc_status wccpd_init() {
     CHECK_STATUS(lc_log_init(wccpd_program_name, nullptr, 0, WCCPD_LOG_COMPONENT, LC_LOG_DEBUG, facility, 1));
     LC_LOG(LC_LOG_NOTICE, "WCCP daemon launched");
     LC_LOG(LC_LOG_DEBUG, "wccpd version %s", wccp_version());
+    if (wccpd_report_missing_privileges() > 0) { // waiting would not bring them
+        (void)lc_log_close();
+        exit(EXIT_FAILURE);
+    }
     CHECK_STATUS(lew_init(&wccpd_lwc));
     CHECK_NULL(wccpd_lwc);
     for (wccpd_signal &known : wccpd_signals)
@@ -177,6 +184,7 @@ lc_status wccpd_init() {
            static_cast<int>(g_qv_encap_clstr_last));
     m_daemon_status = WCCPD_READY;
     CHECK_STATUS(wccpd_pid_init());
+    CHECK_STATUS(wccpd_service_ready());
     return LC_OK;
 }
 
@@ -187,6 +195,7 @@ lc_status wccpd_main_loop() {
 
 lc_status wccpd_initiate_exit() {
     wccpd_exiting = 1;
+    service_report("STOPPING=1");
     wccp_alarms_clear_all();
     LOG_STATUS(qv_initiate_exit());
     for (wccpd_signal &known : wccpd_signals)
@@ -204,6 +213,7 @@ lc_status wccpd_deinit() {
     CHECK_STATUS(wccpd_mgmt_deinit());
     CHECK_STATUS(qv_alm_mgmt_deinit());
     (void)wccp_exit_mgr();
+    wccpd_service_deinit();
     CHECK_STATUS(lew_deinit(&wccpd_lwc));
     return LC_OK;
 }
@@ -221,6 +231,7 @@ int wccpd_main() {
         LOG_STATUS(first);
         exit(first);
     }
+    service_open();
     LOG_STATUS(wccpd_init());
     LOG_STATUS(wccpd_main_loop());
     const lc_status code = wccpd_deinit();

@@ -61,6 +61,7 @@
 #define ACTION_ADD_INTEREST "/mgmtd/events/actions/interest/add"
 #define ACTION_REMOVE_INTEREST "/mgmtd/events/actions/interest/remove"
 #define ACTION_CONFIRM "/mgmtd/config/actions/confirm"
+#define ACTION_REPORT_PROCESS "/mgmtd/process/actions/report"
 
 // --- Alarm types
 #define ALARM_TYPE_ADJACENCY 196638  // no router reports this appliance

@@ -5,10 +5,14 @@
 #include <fstream>
 #include <sstream>
 
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 
+#include "daemon/wccpd_service.h"
 #include "engine/wccp_host.h"
 #include "platform/limits.h"
+#include "runtime/service_notify.h"
 #include "tests/support/daemon_engine.h"
 
 namespace {
@@ -59,6 +63,37 @@ TEST_F(DaemonMain, SignalsThatLeaveItRunning) {
     EXPECT_EQ(said("Received SIGPIPE"), 1);
     EXPECT_EQ(said("Received SIGUSR2"), 1);
     EXPECT_EQ(said("Got unexpected signal SIGCHLD"), 1);
+}
+
+// The reports of being alive stop while the engine's lock is not to be had.
+TEST_F(DaemonMain, ReportsToItsServiceManager) {
+    const int manager = socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK, 0);
+    sockaddr_un address = {AF_UNIX, "\0manager"};
+    ASSERT_EQ(bind(manager, reinterpret_cast<sockaddr *>(&address), sizeof(sa_family_t) + 8), 0);
+    const auto heard = [&] {
+        char text[64];
+        const ssize_t length = recv(manager, text, sizeof text, 0);
+        return length < 0 ? std::string() : std::string(text, static_cast<size_t>(length));
+    };
+    setenv("NOTIFY_SOCKET", "@manager", 1);
+    setenv("WATCHDOG_USEC", "48000", 1);
+    setenv("WATCHDOG_PID", std::to_string(getpid()).c_str(), 1);
+    service_open();
+    EXPECT_EQ(getenv("NOTIFY_SOCKET"), nullptr);
+    EXPECT_EQ(service_watchdog_ms(), 48);
+    ASSERT_EQ(lew_init(&wccpd_lwc), LC_OK);
+    ASSERT_EQ(wccpd_service_ready(), LC_OK);
+    EXPECT_EQ(heard(), "READY=1");
+    EXPECT_EQ(heard(), "WATCHDOG=1");
+    (void)lew_dispatch_once(wccpd_lwc, nullptr, nullptr);
+    EXPECT_EQ(heard(), "WATCHDOG=1");
+    pthread_mutex_lock(&wccp_g.lock);
+    (void)lew_dispatch_once(wccpd_lwc, nullptr, nullptr);
+    EXPECT_EQ(heard(), "");
+    pthread_mutex_unlock(&wccp_g.lock);
+    wccpd_service_deinit();
+    EXPECT_EQ(lew_deinit(&wccpd_lwc), LC_OK);
+    close(manager);
 }
 
 TEST_F(DaemonMain, WithoutALoopNothingStarts) {

@@ -1288,3 +1288,45 @@ TEST(Supervision, ALossIsReportedWhenNobodyTakesOverInTime) {
     EXPECT_EQ(told, (strings{EVENT_PROCESS_TERMINATE, EVENT_PROCESS_TERMINATE}));
     EXPECT_TRUE(supervisor_is_done(self));
 }
+
+// Started by systemd, say: mgmtd sees sessions, and what the process itself reports.
+TEST(Supervision, SomebodyElsesProcessIsKnownByItsSessions) {
+    strings told;
+    std::string said;
+    int64_t now = 100000;
+    supervisor self;
+    self.children = {{"tunneld", {}}, {"wccpd", {}}};
+    self.children[0].takes_over = true;
+    self.now_ms = [&] { return now; };
+    self.say = [&](const std::string &line) { said += line; };
+    self.tell = [&](const std::string &event, const std::string &process) {
+        told.push_back(process + event);
+    };
+    EXPECT_EQ(supervisor_tick(&self), -1) << "nobody is started";
+    supervisor_session_opened(&self, "tunneld-7");
+    supervisor_session_closed(&self, "tunneld-7");
+    EXPECT_EQ(supervisor_tick(&self), now + TAKE_OVER_MS);
+    now += 40;
+    supervisor_session_opened(&self, "tunneld-9");
+    EXPECT_EQ(said, "process tunneld: its session is lost, replaced after 40 ms");
+    EXPECT_EQ(supervisor_tick(&self), -1);
+
+    // An orderly end is reported by the process, and the end of its session is no second one.
+    EXPECT_TRUE(supervisor_take_report(&self, "tunneld"));
+    supervisor_session_closed(&self, "tunneld-9");
+    EXPECT_EQ(supervisor_tick(&self), -1);
+    supervisor_session_opened(&self, "tunneld-11");
+    supervisor_session_closed(&self, "tunneld-11");
+    now += TAKE_OVER_MS;
+    (void)supervisor_tick(&self);
+    EXPECT_EQ(told, strings{"tunneld" EVENT_PROCESS_CRASH});
+
+    supervisor_session_opened(&self, "wccpd-8");
+    supervisor_session_opened(&self, "wccpd-8");
+    supervisor_session_closed(&self, "wccpd-8");
+    EXPECT_EQ(told.size(), 1u) << "it has another session";
+    supervisor_session_closed(&self, "wccpd-8");
+    EXPECT_EQ(told.back(), "wccpd" EVENT_PROCESS_EXIT);
+    self.children[0].command = {"tunneld"};
+    EXPECT_FALSE(supervisor_take_report(&self, "tunneld")) << "the supervisor reports what it has started";
+}

@@ -45,6 +45,21 @@ lab_configure a1 "$(lab_group 51 10.0.0.1 weight=7)" || fail "the weight is refu
 lab_wait 15 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight does not arrive"
 in_order "Received event: /mgmtd/notify/dbchange" "WCCP config: set weight to 7" "WCCP Modify config complete"
 
+# Without a privilege that it needs it says so, and ends.
+lacking() { # PROGRAM EXPRESSION COMMAND... : which runs the program
+    local said
+    said=$(lab_in a1 timeout 10 "${@:3}" "$WCCP_BIN/$1" 2>&1 >/dev/null)
+    [ $? = 1 ] && grep -Eq "^$1: .*$2" <<<"$said" || fail "$1 without privileges: $said"
+}
+lacking wccpd 'missing privilege: CAP_IPC_LOCK, .* \(now 64 KiB\)' prlimit --memlock=65536 setpriv --bounding-set -all --inh-caps -all
+lacking wccpd 'missing privilege: to be root or user 0' setpriv --reuid 65534 --clear-groups --ambient-caps +ipc_lock --inh-caps +ipc_lock
+lacking tunneld 'missing privileges: CAP_NET_ADMIN, CAP_NET_RAW' \
+    unshare --mount sh -c 'mount -t tmpfs tmpfs /run && exec "$@"' - setpriv --bounding-set -all --inh-caps -all
+for program in wccpd tunneld mgmtd mgmtctl; do
+    [[ $("$WCCP_BIN/$program" --version) =~ ^$program\ [0-9]+\.[0-9]+\.[0-9]+$ ]] || fail "$program --version"
+    "$WCCP_BIN/$program" --help | grep -q -e --version || fail "$program --help"
+done
+
 lab_stop a1 wccpd || fail "after SIGTERM the daemon ended with $?"
 in_order "Received SIGTERM" "${last_steps[@]}"
 lab_wait_event 2 a1 '^forgotten with its session: /qv/alarms/state/role/51' || fail "the role is not forgotten"

@@ -316,6 +316,23 @@ TEST_F(Session, AnswersForItsStateAndReports) {
     const strings all = ask("/qv", bn_query_iterate, bn_qf_subtree | bn_qf_leaves_only);
     EXPECT_EQ(std::count(all.begin(), all.end(), NODE_PLANE_STATE "/name=table"), 1);
     EXPECT_EQ(std::count(all.begin(), all.end(), NODE_TUNNEL_STATE "/3/index=7"), 1);
+
+    // Its orderly end is news, unless mgmtd has started it and sees the end itself.
+    const auto ends_are = [&](size_t count) {
+        size_t found_lines = 0;
+        for (size_t at = 0; (at = said.find("process tunneld: " EVENT_PROCESS_TERMINATE, at)) != said.npos;
+             at++)
+            found_lines++;
+        return found_lines == count;
+    };
+    mgmt_link_ends(link);
+    EXPECT_TRUE(wait_until([&] { return ends_are(1); })) << said;
+    bool asked_whether = false;
+    daemon->is_news = [&](const std::string &process) {
+        return (asked_whether = process == "tunneld", false);
+    };
+    mgmt_link_ends(link);
+    EXPECT_TRUE(wait_until([&] { return asked_whether; }) && ends_are(1)) << said;
 }
 
 // --- Health

@@ -15,6 +15,7 @@
 #include "peers/mgmtd/transport.h"
 #include "runtime/common.h"
 #include "runtime/logging.h"
+#include "runtime/service_notify.h"
 #include "runtime/ttime.h"
 #include "runtime/version.h"
 
@@ -63,9 +64,21 @@ static int64_t time_left(int64_t now, std::initializer_list<int64_t> due) {
     return left;
 }
 
+// To the service manager, when it is due. Gives the time of the next report, or -1.
+static int64_t report_alive(int64_t *inout_at_ms) {
+    if (service_watchdog_ms() < 0)
+        return -1;
+    const int64_t now = lt_monotonic_ms();
+    if (now >= *inout_at_ms) {
+        service_report("WATCHDOG=1");
+        *inout_at_ms = now + service_watchdog_ms() / 4;
+    }
+    return *inout_at_ms;
+}
+
 // NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
-    std::string config = "/etc/mgmtd.conf", wccpd = "wccpd", tunneld = "tunneld";
+    std::string config = "/etc/wccpd/mgmtd.conf", wccpd = "wccpd", tunneld = "tunneld";
     bool check = false, supervise = false;
     CLI::App app{"The management daemon: keeps the configuration, reports its changes, asks for states."};
     app.set_version_flag("--version", std::string("mgmtd ") + wccp_version());
@@ -83,6 +96,7 @@ int main(int argc, char **argv) {
             ->capture_default_str();
     CLI11_PARSE(app, argc, argv);
 
+    service_open();
     lc_init();
     lc_log_init("mgmtd", nullptr, 0, COMPONENT_MGMTD, LC_LOG_NOTICE, lc_log_get_facility(nullptr, "mgmtd"),
                 1);
@@ -105,6 +119,7 @@ int main(int argc, char **argv) {
         return 1;
     }
     server_begin(&daemon);
+    service_report("READY=1");
     say("mgmtd ready, " + std::to_string(daemon.tree.nodes.size()) + " nodes");
 
     supervisor processes;
@@ -113,26 +128,28 @@ int main(int argc, char **argv) {
     processes.tell = [&](const std::string &event, const std::string &process) {
         server_process_event(&daemon, event, process);
     };
-    if (supervise) {
-        processes.children.push_back({"tunneld", command_words(tunneld)});
-        processes.children.back().takes_over = true;
-        daemon.opened = [&](const std::string &name) { supervisor_session_opened(&processes, name); };
-        processes.children.push_back({"wccpd", command_words(wccpd)});
-        for (child &process : processes.children)
-            process.lock_file = "/var/run/mgmtd." + process.name + ".lock";
-    }
+    processes.children = {{"tunneld", command_words(supervise ? tunneld : "")},
+                          {"wccpd", command_words(supervise ? wccpd : "")}};
+    processes.children.front().takes_over = true;
+    for (child &process : processes.children)
+        process.lock_file = "/var/run/mgmtd." + process.name + ".lock";
+    daemon.opened = [&](const std::string &name) { supervisor_session_opened(&processes, name); };
+    daemon.closed = [&](const std::string &name) { supervisor_session_closed(&processes, name); };
+    daemon.is_news = [&](const std::string &name) { return supervisor_take_report(&processes, name); };
+    int64_t alive_at_ms = 0;
     for (;;) {
         const int64_t child_due = supervisor_tick(&processes);
         if (processes.ending && supervisor_is_done(processes))
             break;
-        const int64_t query_due = server_tick(&daemon);
+        const int64_t query_due = server_tick(&daemon), alive_due = report_alive(&alive_at_ms);
         std::vector<pollfd> others = {{signals, POLLIN, 0}};
         supervisor_watch(processes, &others);
-        transport_round(&sockets, &others, time_left(lt_monotonic_ms(), {child_due, query_due}));
+        transport_round(&sockets, &others, time_left(lt_monotonic_ms(), {child_due, query_due, alive_due}));
         if (others[0].revents & POLLIN)
             take_signals(signals, &daemon, &processes);
         supervisor_reap(&processes);
     }
+    service_report("STOPPING=1");
     transport_close(&sockets);
     say("mgmtd ended");
     lc_log_close();

@@ -163,7 +163,7 @@ static action_answer remove_interest(server *self, uint32_t peer_id, const std::
     return {};
 }
 
-// What happened to a process, reported by whoever started it.
+// What happened to a process, reported by whoever started it, or at its end by itself.
 static action_answer report_process(server *self, uint32_t, const std::vector<event_field> &fields) {
     static const std::map<std::string, const char *> events = {
         {"crash", EVENT_PROCESS_CRASH},
@@ -176,7 +176,8 @@ static action_answer report_process(server *self, uint32_t, const std::vector<ev
     if (!process || process->empty() || found == events.end())
         return {LC_BAD_ARGUMENT,
                 "A report needs process_name and event: crash, unexpected_exit or terminate"};
-    server_process_event(self, found->second, *process);
+    if (!self->is_news || self->is_news(*process))
+        server_process_event(self, found->second, *process);
     return {};
 }
 
@@ -199,7 +200,7 @@ static const struct {
     {ACTION_ADD_INTEREST, add_interest, true},
     {ACTION_REMOVE_INTEREST, remove_interest, true},
     {ACTION_CONFIRM, confirm},
-    {"/mgmtd/process/actions/report", report_process},
+    {ACTION_REPORT_PROCESS, report_process},
     {"/mgmtd/time/actions/zonechange", report_zone},
 };
 
@@ -297,6 +298,8 @@ void server_peer_closed(server *self, uint32_t peer_id) {
     const std::string name = found->second.name;
     self->say("session of " + name + " closed");
     self->peers.erase(found);
+    if (self->closed)
+        self->closed(name);
     std::vector<pending_query> left;
     for (auto at = self->pending.begin(); at != self->pending.end();) {
         const auto query = at++;

@@ -96,7 +96,9 @@ struct server {
     std::function<int64_t()> now_ms; // monotonic
     std::function<void(const std::string &line)> say;
     std::function<int64_t()> clock_s = [] { return static_cast<int64_t>(time(nullptr)); }; // since 1970
-    std::function<void(const std::string &name)> opened; // each session, once it is; null: nobody cares
+    std::function<void(const std::string &name)> opened, closed; // each session; null: nobody cares
+    // Whether a report of this process's end is passed on; null: it is.
+    std::function<bool(const std::string &process)> is_news;
     std::function<std::vector<local_address>()> local_addresses = find_local_addresses;
     std::string facility_file; // where programs read the log facility when they start; "": nowhere
 

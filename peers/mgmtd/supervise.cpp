@@ -7,6 +7,10 @@
 // again at once, and its loss is reported only if the new process has no session in time. What it has made in
 // the kernel is still there for the new one.
 //
+// A process that somebody else starts is known by its sessions. It ends with the last of them, and how is not
+// known: that is a crash of one that can be replaced, which is reported unless the next one has a session in
+// time. Therefore such a process reports an orderly end itself, with which all that it has made is gone.
+//
 // A child is held by a descriptor of the process and not by its number: the number may be another process's
 // as soon as somebody else has taken in the child's end.
 #include "peers/mgmtd/supervise.h"
@@ -187,16 +191,48 @@ void supervisor_reap(supervisor *self) {
     }
 }
 
+static bool is_session_of(const child &process, const std::string &name) {
+    if (process.command.empty())
+        return name.starts_with(process.name + "-");
+    return process.pidfd >= 0 && name == process.name + "-" + std::to_string(process.pid);
+}
+
 void supervisor_session_opened(supervisor *self, const std::string &name) {
     for (child &process : self->children) {
-        if (process.pidfd < 0 || name != process.name + "-" + std::to_string(process.pid))
+        if (!is_session_of(process, name))
             continue;
         process.has_session = true;
+        process.sessions++;
+        process.end_reported = false;
         if (process.loss)
             self->say("process " + process.name + ": " + process.loss->text + ", replaced after " +
                       std::to_string(self->now_ms() - process.loss->ended_ms) + " ms");
         process.loss.reset();
     }
+}
+
+void supervisor_session_closed(supervisor *self, const std::string &name) {
+    for (child &process : self->children) {
+        if (!process.command.empty() || !is_session_of(process, name) || --process.sessions > 0 ||
+            process.end_reported || self->ending)
+            continue;
+        if (process.takes_over)
+            process.loss = {EVENT_PROCESS_CRASH, "its session is lost", self->now_ms()};
+        else
+            self->tell(EVENT_PROCESS_EXIT, process.name);
+    }
+}
+
+bool supervisor_take_report(supervisor *self, const std::string &process) {
+    for (child &each : self->children) {
+        if (each.name != process)
+            continue;
+        if (!each.command.empty())
+            return false;
+        each.end_reported = true;
+        each.loss.reset();
+    }
+    return true;
 }
 
 // Gives the time until which the loss is not reported, or -1.
@@ -236,10 +272,11 @@ int64_t supervisor_tick(supervisor *self) {
         return end_last(self, now);
     int64_t next = -1;
     for (child &process : self->children) {
-        if (process.pidfd < 0 && process.start_at_ms <= now)
+        const bool may_start = process.pidfd < 0 && !process.command.empty();
+        if (may_start && process.start_at_ms <= now)
             start(self, &process);
         for (const int64_t due :
-             {process.pidfd < 0 ? process.start_at_ms : -1, report_loss(self, &process, now)})
+             {may_start && process.pidfd < 0 ? process.start_at_ms : -1, report_loss(self, &process, now)})
             if (due >= 0 && (next < 0 || due < next))
                 next = due;
     }

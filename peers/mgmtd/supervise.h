@@ -1,4 +1,5 @@
-// The processes that mgmtd starts: started, seen to end, reported, started again.
+// The processes that mgmtd starts: started, seen to end, reported, started again. Without --supervise
+// somebody else does, such as systemd, and mgmtd reports their ends by what it sees of their sessions.
 #pragma once
 
 #include <cstdint>
@@ -28,13 +29,16 @@ struct process_loss { // of a run whose next one may take over
 };
 struct child {
     std::string name;
-    std::vector<std::string> command;
+    std::vector<std::string> command; // empty: somebody else starts it
     pid_t pid = 0;
     int pidfd = -1; // -1: does not run
     int64_t started_ms = 0, start_at_ms = 0, delay_ms = 0;
     int64_t kill_at_ms = -1;
     bool takes_over = false;
     bool has_session = false; // this run has opened one
+    // Of a process that somebody else starts.
+    int sessions = 0;          // that are open
+    bool end_reported = false; // by the process itself, whose sessions are about to close
     std::optional<process_loss> loss = {};
     // A file that each run holds locked, or "". The run of a mgmtd that was killed may not have ended yet,
     // and two at a time get into each other's way.
@@ -57,8 +61,11 @@ std::vector<std::string> command_words(const std::string &line);
 void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout);
 // Takes in who has ended.
 void supervisor_reap(supervisor *self);
-// The session of this name, "tunneld-123", is open.
+// The session of this name, "tunneld-123", is open, or has been.
 void supervisor_session_opened(supervisor *self, const std::string &name);
+void supervisor_session_closed(supervisor *self, const std::string &name);
+// A report of the end of a process. False when it is not to be passed on: the supervisor sees the end itself.
+bool supervisor_take_report(supervisor *self, const std::string &process);
 // Starts who is due, or when ending, ends one after the other, the last started first. Gives the time of the
 // next thing to do, or -1.
 int64_t supervisor_tick(supervisor *self);

@@ -574,3 +574,15 @@ void mgmt_link_proxy_changed(mgmt_link *link, uint8_t group, bool up, const std:
     send_event(link, EVENT_PROXY_CHANGE,
                {group_field(group), {"up", {bn_type_bool, up ? "true" : "false"}}, reason_field(reason)});
 }
+
+void mgmt_link_ends(mgmt_link *link) {
+    owned_request msg;
+    if (link->stage != mgmt_link::open ||
+        bn_action_request_msg_create(&msg.pointer, ACTION_REPORT_PROCESS) != LC_OK)
+        return;
+    for (const auto &[name, value] : {std::pair("process_name", "tunneld"), {"event", "terminate"}})
+        if (bn_action_request_msg_append_new_binding(msg.pointer, 0, name, bn_type_str, value, nullptr) !=
+            LC_OK)
+            return;
+    (void)send_request(link, msg.pointer, nullptr);
+}

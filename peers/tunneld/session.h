@@ -41,3 +41,6 @@ void mgmt_link_ask_routers(mgmt_link *link);
 void mgmt_link_group_leaves(mgmt_link *link, uint8_t group, const std::string &reason);
 void mgmt_link_group_joins(mgmt_link *link, uint8_t group);
 void mgmt_link_proxy_changed(mgmt_link *link, uint8_t group, bool up, const std::string &reason);
+// tunneld ends in order and has removed its tunnels. Whoever needs them has to be told at once: the next
+// tunneld, if one comes, has none to take over.
+void mgmt_link_ends(mgmt_link *link);

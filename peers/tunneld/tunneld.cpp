@@ -29,9 +29,11 @@
 
 #include "peers/tunneld/kernel_state.h"
 #include "platform/tunnel_mailbox.h"
+#include "runtime/capabilities.h"
 #include "runtime/common.h"
 #include "runtime/logging.h"
 #include "runtime/loop_host.h"
+#include "runtime/service_notify.h"
 #include "runtime/ttime.h"
 
 namespace {
@@ -255,6 +257,10 @@ void tick(tunneld *daemon, int64_t now) {
     follow_health(daemon);
     daemon->own_addresses = find_own_addresses();
     reconcile(daemon);
+    if (now >= daemon->alive_at_ms && service_watchdog_ms() >= 0) {
+        service_report("WATCHDOG=1");
+        daemon->alive_at_ms = now + service_watchdog_ms() / 4;
+    }
 }
 
 void look_at_mailbox(int, short, void *data) {
@@ -289,6 +295,19 @@ lc_status take_signal(int number, short, void *, lew *loop) {
 
 // --- Start and end
 
+// What a data plane needs and this process lacks, or "".
+std::string missing_privileges() {
+    static const struct {
+        int capability;
+        const char *name;
+    } needed[] = {{CAP_NET_ADMIN, "CAP_NET_ADMIN"}, {CAP_NET_RAW, "CAP_NET_RAW"}};
+    std::string out;
+    for (const auto &each : needed)
+        if (!lc_has_capability(each.capability))
+            out += (out.empty() ? "" : ", ") + std::string(each.name);
+    return out;
+}
+
 bool choose_plane(tunneld *daemon) {
     std::string reasons;
     for (const data_plane *plane : data_planes) {
@@ -303,6 +322,8 @@ bool choose_plane(tunneld *daemon) {
     }
     daemon->plane_reason = reasons;
     if (!daemon->plane) {
+        if (const std::string missing = missing_privileges(); !missing.empty())
+            reasons += "; missing privileges: " + missing;
         fprintf(stderr, "tunneld: no data plane works here: %s\n", reasons.c_str());
         LC_LOG(LC_LOG_ERR, "No data plane works here: %s", reasons.c_str());
         return false;
@@ -399,17 +420,19 @@ bool take_lock(int *out_fd) {
 }
 
 void end_parts(tunneld *daemon) {
-    if (daemon->management)
-        mgmt_link_free(daemon->management);
     if (daemon->health)
         health_free(daemon->health);
     std::string error;
     if (daemon->plane && daemon->plane != &table_plane && !remove_kernel_state(*daemon->plane, &error))
         LC_LOG(LC_LOG_ERR, "Not everything could be removed from the kernel: %s", error.c_str());
+    if (daemon->management)
+        mgmt_link_ends(daemon->management); // the next one has nothing to take over
     if (daemon->plane) {
         forget_wccpd();
         daemon->plane->close();
     }
+    if (daemon->management)
+        mgmt_link_free(daemon->management);
     if (daemon->mailbox_timer)
         loop_event_free(&daemon->mailbox_timer);
     if (daemon->wake_up_event)
@@ -437,14 +460,17 @@ int run_tunneld(const tunneld_options &options) {
     lc_log_init("tunneld", nullptr, 0, COMPONENT_TUNNELD, LC_LOG_INFO,
                 lc_log_get_facility(nullptr, "tunneld"), 1);
     signal(SIGPIPE, SIG_IGN);
+    service_open();
     tunneld daemon;
     daemon.options = options;
     daemon.desk.options = options.commands;
     daemon.last_command_ms = lt_monotonic_ms();
     bool good = take_lock(&lock) && start_parts(&daemon);
     if (good) {
+        service_report("READY=1");
         look_at_mailbox(-1, 0, &daemon);
         good = lew_dispatch(daemon.loop, nullptr, nullptr) == LC_OK;
+        service_report("STOPPING=1");
     }
     end_parts(&daemon);
     if (lock >= 0)

@@ -50,7 +50,7 @@ struct tunneld {
     configured_view configured;
     int64_t configured_ms = -1; // when it was read first
     bool takes_over = false;    // and sorts as the tunneld before did
-    int64_t tick_at_ms = 0, last_command_ms = 0;
+    int64_t tick_at_ms = 0, last_command_ms = 0, alive_at_ms = 0;
     std::map<uint8_t, bool> forced_l2; // by command, which wins over the configuration
     std::map<uint16_t, bool> roles;    // of the policy groups of groups with an intercept: ACTIVE
     std::map<uint8_t, outage> outages;

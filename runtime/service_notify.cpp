@@ -1,0 +1,71 @@
+#include "runtime/service_notify.h"
+
+#include <cstddef>
+#include <cstdlib>
+#include <cstring>
+#include <initializer_list>
+
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include "runtime/guards.h"
+
+namespace {
+
+sockaddr_un manager = {};
+socklen_t manager_length; // 0: there is none
+int64_t watchdog_ms = -1;
+
+bool parse_number(const char *text, int64_t *out) {
+    char *end = nullptr;
+    *out = strtoll(text, &end, 10);
+    return end != text && *end == '\0' && *out > 0;
+}
+
+void read_socket(const char *path) {
+    const size_t length = strlen(path);
+    // "@" stands for the NUL that begins an abstract name.
+    if ((path[0] != '/' && path[0] != '@') || length < 2 || length >= sizeof manager.sun_path)
+        return;
+    manager.sun_family = AF_UNIX;
+    memcpy(manager.sun_path, path, length);
+    if (path[0] == '@')
+        manager.sun_path[0] = '\0';
+    manager_length = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + length);
+}
+
+void read_watchdog(const char *microseconds, const char *pid) {
+    int64_t whose = 0, limit = 0;
+    if (pid && (!parse_number(pid, &whose) || whose != getpid()))
+        return;
+    if (parse_number(microseconds, &limit) && limit >= 1000)
+        watchdog_ms = limit / 1000;
+}
+
+} // namespace
+
+void service_open() {
+    if (const char *path = getenv("NOTIFY_SOCKET"))
+        read_socket(path);
+    if (const char *limit = getenv("WATCHDOG_USEC"))
+        read_watchdog(limit, getenv("WATCHDOG_PID"));
+    for (const char *name : {"NOTIFY_SOCKET", "WATCHDOG_USEC", "WATCHDOG_PID"})
+        unsetenv(name);
+}
+
+void service_report(const char *state) {
+    if (manager_length == 0)
+        return;
+    const cancel_off_guard uncancelled;
+    const int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+    if (fd < 0)
+        return;
+    (void)sendto(fd, state, strlen(state), MSG_NOSIGNAL, reinterpret_cast<const sockaddr *>(&manager),
+                 manager_length);
+    close(fd);
+}
+
+int64_t service_watchdog_ms() {
+    return manager_length ? watchdog_ms : -1;
+}
