@@ -4,6 +4,7 @@
 set -eu
 build="g++ cmake ninja-build pkg-config libevent-dev libnuma-dev libmd-dev libnl-route-3-dev libnftables-dev libcli11-dev nlohmann-json3-dev"
 lab="iproute2 util-linux procps mount jq nftables haproxy curl"
+package="debhelper libdistro-info-perl"
 capture="tcpdump tshark"
 test="libgtest-dev libbenchmark-dev clang-14 libclang-rt-14-dev clang-format-14 clang-tidy-14 git $capture"
 vm="qemu-system-x86 e2fsprogs"
