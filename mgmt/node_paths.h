@@ -15,6 +15,8 @@
 #define NODE_INTERCEPT_CONFIG "/qv/tunneld/intercept/config" // by service group
 #define NODE_BYPASS_CONFIG "/qv/tunneld/bypass/config"       // by prefix
 #define NODE_ACCEPT_CONFIG "/qv/tunneld/accept/config"       // by address
+#define NODE_PROTECTION_CONFIG "/qv/tunneld/protection/config"
+#define NODE_PROTECTION_TIME NODE_PROTECTION_CONFIG "/time" // seconds that flows are protected; 0: they are not
 #define NODE_SYSLOG "/logging/syslog"
 #define NODE_SYSLOG_FACILITY NODE_SYSLOG "/facility"
 #define NODE_SYSTEM_FACILITY NODE_SYSLOG_FACILITY "/system"
@@ -29,6 +31,7 @@
 #define NODE_PLANE_STATE "/qv/tunneld/plane/state"
 #define NODE_TUNNEL_STATE "/qv/tunneld/tunnel/state"       // by tunnel id
 #define NODE_INTERCEPT_STATE "/qv/tunneld/intercept/state" // by service group
+#define NODE_PROTECTION_STATE "/qv/tunneld/protection/state"
 
 // --- State nodes, kept by mgmtd
 #define NODE_ALARM_STATE "/qv/alarms/state"

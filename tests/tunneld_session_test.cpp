@@ -17,6 +17,7 @@
 #include "peers/tunneld/health.h"
 #include "peers/tunneld/session.h"
 #include "peers/tunneld/session_config.h"
+#include "peers/tunneld/slot_owners.h"
 #include "runtime/ttime.h"
 
 using strings = std::vector<std::string>;
@@ -51,6 +52,7 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
         field(NODE_ACCEPT_CONFIG "/192.0.2.9", "192.0.2.9"),
         field(NODE_ACCEPT_CONFIG "/192.0.2.9/router", "192.0.2.1"),
         field(NODE_ACCEPT_CONFIG "/somewhere", "somewhere"),
+        field(NODE_PROTECTION_TIME, "60"),
     };
     strings complaints;
     configured_view view = read_configuration(nodes, &complaints);
@@ -64,6 +66,7 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
     EXPECT_EQ(rules.check.interval_s, 5u);
     EXPECT_EQ(view.bypasses, (std::vector<bypass_entry>{{{0x0a000000, 8}, 99}}));
     EXPECT_EQ(view.accepted, (std::vector<accepted_source>{{0xc0000209, 0xc0000201}}));
+    EXPECT_EQ(view.protection_s, 60u);
     EXPECT_EQ(view.groups.size(), 2u);
     EXPECT_EQ(view.groups[51], (group_view{"eth0", 0, 0, true, {}}));
     EXPECT_EQ(view.groups[52].interface, "");
@@ -85,6 +88,92 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
                               ""));
     EXPECT_EQ(read_configuration(nodes, &complaints).bypasses.size(), BYPASSES_MAX);
     EXPECT_EQ(complaints.size(), COMPLAINTS_MAX);
+}
+
+// --- Owners of slots
+
+TEST(SlotOwners, TextIsReadWholeOrNotAtAll) {
+    owners_report report;
+    ASSERT_TRUE(
+        parse_owners("mask 3 0 0 8000 members 10.0.0.2 10.0.0.1 owners 10.0.0.2*7 0.0.0.0*1", &report));
+    EXPECT_TRUE(report.by_mask && report.mask == (slot_mask{3, 0, 0, 0x8000}));
+    EXPECT_EQ(report.members, (std::vector<uint32_t>{0x0a000001, 0x0a000002}));
+    EXPECT_TRUE(report.owners.size() == 8 && report.owners[6] == 0x0a000002 && report.owners[7] == 0);
+    EXPECT_EQ(slot_value(report.mask, 5), (slot_mask{2, 0, 0, 0x8000}));
+    EXPECT_TRUE(parse_owners("hash members", &report) && report.owners.empty());
+    std::string many = "hash members";
+    for (int i = 0; i < 33; i++)
+        many += " 10.0.0.1";
+    for (const std::string &bad :
+         {std::string(), std::string("hash"), std::string("hash members 0.0.0.0"), many,
+          std::string("hash members 10.0.0.1 owners 10.0.0.1*255"),
+          std::string("hash members 10.0.0.1 owners 10.0.0.1*256 10.0.0.1*1"),
+          std::string("hash members 10.0.0.1 owners 10.0.0.1*-1"),
+          std::string("mask ff 0 0 0 members 10.0.0.1"), std::string("mask 1 0 0 10000 members 10.0.0.1"),
+          std::string("mask 1 0 0 members 10.0.0.1")})
+        EXPECT_FALSE(parse_owners(bad, &report)) << bad;
+}
+
+TEST(SlotOwners, PacketsGoToTheOwnerOrToTheOneWhoHadMostFlows) {
+    constexpr uint32_t A = 0x0a000001, B = 0x0a000002, C = 0x0a000003, NOBODY = 0;
+    constexpr int64_t START = 100000, TIME = 300;
+    struct report {
+        int64_t after;
+        uint32_t owner;
+        std::vector<uint32_t> members = {A, B, C};
+    };
+    const struct {
+        const char *what;
+        std::vector<report> reports;
+        int64_t asked_after;
+        uint32_t self, target;
+    } rows[] = {
+        {"nothing has changed", {{0, A}}, 5, A, NOBODY},
+        {"stale: the owner is another one", {{0, A}}, 5, B, A},
+        {"the owner has left", {{0, A}, {5, A, {B, C}}}, 6, B, NOBODY},
+        {"moved here", {{0, A}, {10, B}}, 10, B, A},
+        {"at the one that had it", {{0, A}, {10, B}}, 10, A, B},
+        {"nobody has it for a time", {{0, A}, {10, NOBODY}, {20, B}}, 30, B, A},
+        {"moved here long ago", {{0, A}, {10, B}}, 310, B, NOBODY},
+        {"just before that", {{0, A}, {10, B}}, 309, B, A},
+        {"the former owner has left", {{0, A}, {10, B, {B, C}}}, 20, B, NOBODY},
+        {"and comes back", {{0, A}, {10, B, {B, C}}, {50, B}}, 60, B, A},
+        {"there and back", {{0, A}, {10, B}, {20, A}}, 30, A, B},
+        {"a short stay at B: most flows are A's", {{0, A}, {10, B}, {40, C}}, 50, C, A},
+        {"a long stay: A's flows have ended", {{0, A}, {10, B}, {280, C}}, 285, C, B},
+        {"A's time is over", {{0, A}, {10, B}, {200, C}}, 320, C, B},
+    };
+    for (const auto &row : rows) {
+        SCOPED_TRACE(row.what);
+        owners_table table;
+        for (const report &each : row.reports) {
+            owners_report now = {true, {}, each.members, {each.owner}};
+            EXPECT_TRUE(note_owners(&table, 51, now, START + each.after, TIME) || each.owner == NOBODY);
+            EXPECT_FALSE(note_owners(&table, 51, now, START + each.after, TIME)) << "the same again";
+        }
+        // Also for the next process.
+        const owners_table read = read_owners_file(owners_file_text(table), START + row.asked_after);
+        EXPECT_EQ(read, table);
+        EXPECT_EQ(slot_targets(read.at(51), row.self, START + row.asked_after, TIME),
+                  std::vector<uint32_t>{row.target});
+    }
+
+    // A wccpd that has just begun changes nothing; another kind of table has no history.
+    owners_table table;
+    note_owners(&table, 0, {false, {}, {A, B}, std::vector<uint32_t>(SLOTS_MAX, A)}, START, TIME);
+    note_owners(&table, 0, {false, {}, {A, B}, std::vector<uint32_t>(SLOTS_MAX, B)}, START + 1, TIME);
+    EXPECT_FALSE(note_owners(&table, 0, {true, {1, 0, 0, 0}, {}, {}}, START, TIME));
+    const std::string text = owners_file_text(table);
+    EXPECT_EQ(text, "0 hash members 10.0.0.1 10.0.0.2 slots 256*10.0.0.2,100001;10.0.0.1,0,100001\n");
+    EXPECT_TRUE(note_owners(&table, 0, {true, {1, 0, 0, 0}, {A, B}, {A, B}}, START + 2, TIME));
+    EXPECT_TRUE(table[0].slots[0].former.empty());
+    // A file that is cut or bad loses its bad lines alone; no time lies ahead.
+    const owners_table odd = read_owners_file("300 hash members slots\n" + text +
+                                                  "7 hash members 10.0.0.1 slots 255*10.0.0.1,0\n" +
+                                                  text.substr(0, text.size() - 7) + "x\n9 hash members",
+                                              START - 5);
+    ASSERT_EQ(odd.size(), 1u);
+    EXPECT_EQ(odd.at(0).slots[255].former, (std::vector<former_owner>{{A, 0, START - 5}}));
 }
 
 // --- A loop with a ticker, so that it comes round
@@ -131,7 +220,7 @@ struct Session : Loop {
     std::string said, method = "not-set";
     mgmt_link *link = nullptr;
     configured_view view;
-    int readings = 0;
+    int readings = 0, owners_heard = 0;
     std::vector<state_node> states = {{NODE_PLANE_STATE "/name", bn_type_str, "table"},
                                       {NODE_TUNNEL_STATE "/3/index", bn_type_uint32, "7"},
                                       {NODE_TUNNEL_STATE "/12/index", bn_type_uint32, "8"}};
@@ -150,6 +239,9 @@ struct Session : Loop {
             readings++;
         };
         callbacks.state = [this] { return states; };
+        callbacks.owners = [this](uint8_t group, const std::string &text) {
+            owners_heard += group == 51 && text == "hash members 192.0.2.3";
+        };
         link = mgmt_link_new(wrapper, callbacks);
         ASSERT_TRUE(link);
     }
@@ -207,6 +299,8 @@ struct Session : Loop {
                 const bn_request_node *node = bn_request_per_node_array_get_quick(msg.pointer->nodes, i);
                 if (name_of(node->binding) == NODE_GROUP_STATE)
                     add(node->node_id, group, "51");
+                if (name_of(node->binding) == group + "/owners")
+                    add(node->node_id, group + "/owners", "hash members 192.0.2.3");
                 if (name_of(node->binding) == group + "/router") {
                     add(node->node_id, router + "/id", "192.0.2.1");
                     add(node->node_id, router + "/ipaddr", "192.0.2.2");
@@ -242,6 +336,15 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     EXPECT_EQ(view.intercepts[51].to, 3128);
     EXPECT_EQ(view.groups[51].local, INADDR_LOOPBACK);
     EXPECT_EQ(view.groups[51].routers[0], (group_router{0xc0000201, 0xc0000202}));
+
+    // Owners of slots are asked for now and then, unless flows are not protected.
+    ASSERT_TRUE(wait_until([&] { return owners_heard > 0; }));
+    const int heard = owners_heard;
+    EXPECT_TRUE(wait_until([&] { return owners_heard >= heard + 2; }));
+    set(NODE_PROTECTION_TIME, "0");
+    ASSERT_TRUE(wait_until([&] { return view.protection_s == 0; }));
+    owners_heard = 0;
+    EXPECT_FALSE(wait_until([&] { return owners_heard > 1; }, 2500));
 
     // A change that is none is not passed on; methods that have been negotiated are, and stay.
     method = "L2";

@@ -124,6 +124,8 @@ static const std::vector<schema_row> rows = [] {
         {ACCEPT, bn_type_ipv4addr, nullptr, 0, 0, nullptr, check_host_address, true},
         {ACCEPT "/router", bn_type_ipv4addr, "0.0.0.0", 0, 0, nullptr, check_host_address_or_none},
 
+        {NODE_PROTECTION_TIME, bn_type_uint32, "300", 0, 86400, nullptr, nullptr},
+
         {NODE_SYSTEM_FACILITY, bn_type_uint32, "136", 0, 184, nullptr, check_facility},
         {NODE_SYSLOG "/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level},
         {MESSAGES "/all/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level},
@@ -195,7 +197,7 @@ const std::vector<const char *> &wccpd_state_nodes() {
     node "/in", node "/in_bytes", node "/to_proxy", node "/to_proxy_bytes", node "/bypassed",                \
         node "/bypassed_bytes", node "/returned", node "/returned_bytes", node "/down", node "/down_bytes",  \
         node "/forwarded", node "/forwarded_bytes", node "/dropped", node "/dropped_bytes", node "/own",     \
-        node "/own_bytes"
+        node "/own_bytes", node "/passed", node "/passed_bytes"
 
 const std::vector<const char *> &tunneld_state_nodes() {
     static const std::vector<const char *> nodes = {
@@ -226,6 +228,21 @@ const std::vector<const char *> &tunneld_state_nodes() {
         NODE_INTERCEPT_STATE "/*/active",
         NODE_INTERCEPT_STATE "/*/left",
         SORTED(NODE_INTERCEPT_STATE "/*"),
+        NODE_PROTECTION_STATE "/time",
+        NODE_PROTECTION_STATE "/passed",
+        NODE_PROTECTION_STATE "/received",
+        NODE_PROTECTION_STATE "/delivered",
+        NODE_PROTECTION_STATE "/returned",
+        NODE_PROTECTION_STATE "/group/*",
+        NODE_PROTECTION_STATE "/group/*/covered",
+        NODE_PROTECTION_STATE "/group/*/reason",
+        NODE_PROTECTION_STATE "/group/*/slots",
+        NODE_PROTECTION_STATE "/member/*",
+        NODE_PROTECTION_STATE "/member/*/interface",
+        NODE_PROTECTION_STATE "/member/*/passed",
+        NODE_PROTECTION_STATE "/member/*/received",
+        NODE_PROTECTION_STATE "/member/*/delivered",
+        NODE_PROTECTION_STATE "/member/*/returned",
     };
     return nodes;
 }

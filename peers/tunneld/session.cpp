@@ -42,6 +42,7 @@ constexpr int64_t ANSWER_MAX_MS = 15000;  // then a request is made again
 // only while something is missing, up to the third; when nothing is.
 constexpr int64_t ROUTERS_FIRST_MS = 50, ROUTERS_SETTLED_MS = 1000, ROUTERS_MISSING_MS = 5000,
                   ROUTERS_KNOWN_MS = 30000;
+constexpr int64_t OWNERS_MS = 2000;       // between questions about the owners of slots
 constexpr int64_t ROUTER_KEPT_MS = 60000; // after wccpd listed it last
 constexpr int64_t NEVER = INT64_MAX;
 constexpr size_t REASON_MAX = 256;
@@ -67,10 +68,12 @@ struct mgmt_link {
     enum { closed, greeting, opening, open } stage = closed;
     int64_t connect_at_ms = 0, opened_ms = 0; // `opened_ms`: when the opening began
 
-    request configuration, groups, routers; // that are under way
+    request configuration, groups, routers, owners; // that are under way
     int64_t read_at_ms = NEVER, ask_routers_at_ms = NEVER, ask_wait_ms = ROUTERS_FIRST_MS;
-    std::vector<event_field> configured, listed, states; // answers, as they came
-    bool has_configured = false, has_listed = false, has_states = false;
+    int64_t ask_owners_at_ms = NEVER;
+    bool routers_are_due = false;                               // once the groups are known
+    std::vector<event_field> configured, listed, states, owned; // answers, as they came
+    bool has_configured = false, has_listed = false, has_states = false, has_owned = false;
 
     bool announced = false; // `view` has been given to the caller in this session
     configured_view view;
@@ -94,15 +97,19 @@ bool send_request(mgmt_link *link, bn_request_msg *msg, request *out) {
     return true;
 }
 
-bool send_walks(mgmt_link *link, const std::vector<std::string> &roots, uint32_t flags, request *out) {
+bool send_queries(mgmt_link *link, uint32_t what, const std::vector<std::string> &names, uint32_t flags,
+                  request *out) {
     owned_request msg;
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK)
         return false;
-    for (const std::string &root : roots)
-        if (bn_query_request_msg_append_str(msg.pointer, bn_query_iterate, flags, root.c_str(), nullptr) !=
-            LC_OK)
+    for (const std::string &name : names)
+        if (bn_query_request_msg_append_str(msg.pointer, what, flags, name.c_str(), nullptr) != LC_OK)
             return false;
     return send_request(link, msg.pointer, out);
+}
+
+bool send_walks(mgmt_link *link, const std::vector<std::string> &roots, uint32_t flags, request *out) {
+    return send_queries(link, bn_query_iterate, roots, flags, out);
 }
 
 bool send_interest(mgmt_link *link, const char *event, std::initializer_list<const char *> patterns) {
@@ -135,7 +142,7 @@ void send_event(mgmt_link *link, const char *name, const std::vector<event_field
 }
 
 void ask_routers_now(mgmt_link *link) {
-    link->ask_routers_at_ms = lt_monotonic_ms();
+    link->ask_routers_at_ms = link->ask_owners_at_ms = lt_monotonic_ms();
     link->ask_wait_ms = ROUTERS_FIRST_MS;
 }
 
@@ -170,7 +177,8 @@ lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) {
         }
         advance_soon(link);
     } else if (take_answer(&link->groups, msg, &link->listed, &link->has_listed) ||
-               take_answer(&link->routers, msg, &link->states, &link->has_states)) {
+               take_answer(&link->routers, msg, &link->states, &link->has_states) ||
+               take_answer(&link->owners, msg, &link->owned, &link->has_owned)) {
         advance_soon(link);
     }
     return LC_OK;
@@ -258,9 +266,9 @@ void drop_session(mgmt_link *link) {
         LC_LOG(LC_LOG_NOTICE, "session with mgmtd lost; tunnels and intercepts stay as they are");
     link->stage = mgmt_link::closed;
     LOG_STATUS(gcl_session_free(&link->session));
-    link->configuration = link->groups = link->routers = {};
-    link->has_configured = link->has_listed = link->has_states = link->announced = false;
-    link->read_at_ms = link->ask_routers_at_ms = NEVER;
+    link->configuration = link->groups = link->routers = link->owners = {};
+    link->has_configured = link->has_listed = link->has_states = link->has_owned = link->announced = false;
+    link->read_at_ms = link->ask_routers_at_ms = link->ask_owners_at_ms = NEVER;
     link->connect_at_ms = lt_monotonic_ms() + RETRY_MS;
 }
 
@@ -391,20 +399,28 @@ void add_what_wccpd_says(const mgmt_link *link, configured_view *inout) {
 
 bool same(const configured_view &a, const configured_view &b) {
     return a.groups == b.groups && a.intercepts == b.intercepts && a.bypasses == b.bypasses &&
-           a.accepted == b.accepted;
+           a.accepted == b.accepted && a.protection_s == b.protection_s;
+}
+
+bool wants_owners(const mgmt_link *link) {
+    return link->announced && link->view.protection_s != 0 && !link->view.intercepts.empty();
 }
 
 // The groups that wccpd runs are asked for by name: a question about another would be an error in its log.
 void ask_about_groups(mgmt_link *link) {
     static const node_name root = parsed_name(NODE_GROUP_STATE);
-    std::vector<std::string> walks;
+    std::vector<std::string> walks, owners;
     for (const event_field &node : link->listed)
         if (const node_name name = parsed_name(node.name);
-            name.is_under(root) && name.parts.size() == root.parts.size() + 1)
+            name.is_under(root) && name.parts.size() == root.parts.size() + 1) {
             walks.push_back(name.below("router").text());
+            owners.push_back(name.below("owners").text());
+        }
     link->listed.clear();
-    if (!walks.empty())
+    if (!walks.empty() && link->routers_are_due)
         (void)send_walks(link, walks, bn_qf_subtree, &link->routers);
+    if (!owners.empty() && wants_owners(link))
+        (void)send_queries(link, bn_query_get, owners, 0, &link->owners);
 }
 
 int64_t routers_wait_ms(const mgmt_link *link) {
@@ -430,7 +446,11 @@ void digest(mgmt_link *link) {
         forget_old_routers(link);
     if (link->has_states)
         link->ask_routers_at_ms = lt_monotonic_ms() + routers_wait_ms(link);
-    link->has_configured = link->has_listed = link->has_states = false;
+    const bool owned = link->has_owned;
+    link->has_configured = link->has_listed = link->has_states = link->has_owned = false;
+    if (owned)
+        for (const auto &[group, text] : read_group_owners(link->owned))
+            link->callbacks.owners(group, text);
     if (!configured && (!answered || !link->announced))
         return;
     add_what_wccpd_says(link, &next);
@@ -447,21 +467,33 @@ bool may_ask(request *inout, int64_t at_ms, int64_t now) {
     return !inout->id && now >= at_ms;
 }
 
+// When something about wccpd's groups is to be asked.
+int64_t next_question_ms(const mgmt_link *link) {
+    return wants_owners(link) ? std::min(link->ask_routers_at_ms, link->ask_owners_at_ms)
+                              : link->ask_routers_at_ms;
+}
+
 // Requests that are due. One of a kind is under way at a time.
 void ask(mgmt_link *link) {
     const int64_t now = lt_monotonic_ms();
     if (may_ask(&link->configuration, link->read_at_ms, now)) {
         link->read_at_ms = NEVER;
         if (!send_walks(link,
-                        {NODE_GROUP_CONFIG, NODE_INTERCEPT_CONFIG, NODE_BYPASS_CONFIG, NODE_ACCEPT_CONFIG},
+                        {NODE_GROUP_CONFIG, NODE_INTERCEPT_CONFIG, NODE_BYPASS_CONFIG, NODE_ACCEPT_CONFIG,
+                         NODE_PROTECTION_CONFIG},
                         bn_qf_subtree, &link->configuration))
             link->read_at_ms = now + RETRY_MS;
     }
-    if (may_ask(&link->routers, now, now) && may_ask(&link->groups, link->ask_routers_at_ms, now)) {
-        (void)send_walks(link, {NODE_GROUP_STATE}, 0, &link->groups);
-        link->ask_routers_at_ms = now + routers_wait_ms(link);
-        link->ask_wait_ms = std::min(link->ask_wait_ms * 2, ROUTERS_MISSING_MS);
-    }
+    if (!may_ask(&link->routers, now, now) || !may_ask(&link->owners, now, now) ||
+        !may_ask(&link->groups, next_question_ms(link), now))
+        return;
+    (void)send_walks(link, {NODE_GROUP_STATE}, 0, &link->groups);
+    link->ask_owners_at_ms = now + OWNERS_MS;
+    link->routers_are_due = link->ask_routers_at_ms <= now;
+    if (!link->routers_are_due)
+        return;
+    link->ask_routers_at_ms = now + routers_wait_ms(link);
+    link->ask_wait_ms = std::min(link->ask_wait_ms * 2, ROUTERS_MISSING_MS);
 }
 
 int64_t next_step_ms(const mgmt_link *link) {
@@ -478,13 +510,13 @@ int64_t next_step_ms(const mgmt_link *link) {
         break;
     }
     int64_t next = NEVER;
-    for (const request *waiting : {&link->configuration, &link->groups, &link->routers})
+    for (const request *waiting : {&link->configuration, &link->groups, &link->routers, &link->owners})
         if (waiting->id)
             next = std::min(next, waiting->deadline_ms);
     if (!link->configuration.id)
         next = std::min(next, link->read_at_ms);
-    if (!link->groups.id && !link->routers.id)
-        next = std::min(next, link->ask_routers_at_ms);
+    if (!link->groups.id && !link->routers.id && !link->owners.id)
+        next = std::min(next, next_question_ms(link));
     return next == NEVER ? ROUTERS_KNOWN_MS : next - now;
 }
 

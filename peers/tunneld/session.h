@@ -16,6 +16,7 @@ struct configured_view {
     std::map<uint8_t, intercept> intercepts;
     std::vector<bypass_entry> bypasses; // also those whose time is over
     std::vector<accepted_source> accepted;
+    uint32_t protection_s = 300; // that flows are passed on to the former owner of their slot; 0: never
 };
 
 // A state node that tunneld answers for: its full name, its type (bn_type_...) and its text.
@@ -28,6 +29,8 @@ struct state_node {
 struct session_callbacks {
     std::function<void(const configured_view &view)> configured; // after the first reading and each change
     std::function<std::vector<state_node>()> state;              // all nodes, in the order of a walk
+    // What wccpd says of the owners of a group's slots, as it comes: see slot_owners.h.
+    std::function<void(uint8_t group, const std::string &text)> owners;
 };
 struct mgmt_link; // owned by whoever made it
 // Connects when mgmtd is there, again every second while it isn't. Null: no memory.

@@ -251,6 +251,12 @@ void read_accepted(reading *self, const std::string &instance, const std::string
         self->complain("accepted sources after the first " + std::to_string(ACCEPTED_MAX) + " ignored");
 }
 
+// A node of the whole table of its own.
+void read_protection(reading *self, const std::string &leaf, const std::string &, const std::string &text) {
+    if (leaf == "time" && !take_number(text, 0, 86400, &self->view.protection_s))
+        self->complain("protection: time \"" + shown_text(text) + "\" ignored");
+}
+
 template <void (*Read)(reading *, uint8_t, const std::string &, const std::string &)>
 void read_by_group(reading *self, const std::string &instance, const std::string &leaf,
                    const std::string &text) {
@@ -268,6 +274,7 @@ constexpr struct {
     {NODE_INTERCEPT_CONFIG, read_by_group<read_intercept>},
     {NODE_BYPASS_CONFIG, read_bypass},
     {NODE_ACCEPT_CONFIG, read_accepted},
+    {NODE_PROTECTION_CONFIG, read_protection},
 };
 } // namespace
 
@@ -311,6 +318,20 @@ std::map<uint8_t, size_t> count_configured_routers(const std::vector<event_field
 }
 
 // --- wccpd's state
+
+std::map<uint8_t, std::string> read_group_owners(const std::vector<event_field> &nodes) {
+    static const node_name root = parsed_name(NODE_GROUP_STATE);
+    const size_t depth = root.parts.size();
+    std::map<uint8_t, std::string> out;
+    for (const event_field &node : nodes) {
+        const node_name name = parsed_name(node.name);
+        uint8_t group = 0;
+        if (name.is_under(root) && name.parts.size() == depth + 2 && name.parts.back() == "owners" &&
+            take_number(name.parts[depth], 0, 255, &group))
+            out[group] = node.value.text;
+    }
+    return out;
+}
 
 std::map<uint8_t, std::vector<group_router>> read_group_routers(const std::vector<event_field> &nodes) {
     static const node_name root = parsed_name(NODE_GROUP_STATE);

@@ -30,6 +30,8 @@ configured_view read_configuration(const std::vector<event_field> &nodes,
 // The number of routers that the configuration names for each group that is up.
 std::map<uint8_t, size_t> count_configured_routers(const std::vector<event_field> &nodes);
 
+// From wccpd's answer: its text about the owners of slots, by group.
+std::map<uint8_t, std::string> read_group_owners(const std::vector<event_field> &nodes);
 // From wccpd's answer about groups: routers that have answered it, by group. Methods that are not negotiated
 // are unknown.
 std::map<uint8_t, std::vector<group_router>> read_group_routers(const std::vector<event_field> &nodes);

@@ -22,7 +22,8 @@ enum sorted_as : uint8_t {
                      // (returned)
     SORTED_FORWARDED,
     SORTED_DROPPED,
-    SORTED_OWN, // the appliance's own traffic, redirected to itself
+    SORTED_OWN,    // the appliance's own traffic, redirected to itself
+    SORTED_PASSED, // of a flow that another appliance has
     SORTED_WAYS
 };
 extern const char *const sorted_words[SORTED_WAYS]; // "in", "to_proxy", ...

@@ -8,8 +8,8 @@
 
 #include "peers/tunneld/sorting_rules.h"
 
-const char *const sorted_words[SORTED_WAYS] = {"in",   "to_proxy",  "bypassed", "returned",
-                                               "down", "forwarded", "dropped",  "own"};
+const char *const sorted_words[SORTED_WAYS] = {"in",        "to_proxy", "bypassed", "returned", "down",
+                                               "forwarded", "dropped",  "own",      "passed"};
 
 namespace {
 

@@ -28,6 +28,7 @@
 #include <nlohmann/json.hpp>
 
 #include "peers/tunneld/kernel_state.h"
+#include "peers/tunneld/protection.h"
 #include "platform/tunnel_mailbox.h"
 #include "runtime/capabilities.h"
 #include "runtime/common.h"
@@ -87,6 +88,7 @@ appliance_view view_appliance(const tunneld &daemon) {
         if (entry.until == 0 || entry.until > now)
             view.bypasses.push_back(entry);
     view.accepted = daemon.configured.accepted;
+    view.protections = find_protections(daemon.owners, view.groups, daemon.configured.protection_s);
     view.own_addresses = daemon.own_addresses;
     return view;
 }
@@ -238,11 +240,17 @@ void take_configuration(tunneld *daemon, const configured_view &view) {
         it = daemon->outages.erase(it);
     }
     std::erase_if(daemon->forced_l2, [&](const auto &entry) { return !view.groups.contains(entry.first); });
+    keep_owners_of(&daemon->owners, view.groups);
     health_set_checks(daemon->health, view.intercepts);
     read_roles(daemon);
     report_outages(daemon);
     reconcile(daemon);
     daemon->last_command_ms = lt_monotonic_ms(); // commands may follow
+}
+
+void hear_owners(tunneld *daemon, uint8_t group, const std::string &text) {
+    if (take_owners(&daemon->owners, group, text, daemon->configured.protection_s))
+        reconcile(daemon);
 }
 
 // --- The loop
@@ -339,6 +347,7 @@ bool choose_plane(tunneld *daemon) {
 // Takes over what a killed tunneld has left. Of two tunnels with one id the one that was made last is kept:
 // the other was being replaced.
 void take_over(tunneld *daemon) {
+    daemon->owners = load_owners();
     daemon->links = find_own_links();
     daemon->takes_over = !daemon->links.empty() || is_kernel_state_left();
     if (!daemon->takes_over)
@@ -391,8 +400,10 @@ bool start_parts(tunneld *daemon) {
     if (daemon->options.commands.silent) // like a program that hangs
         return true;
     daemon->management = mgmt_link_new(
-        daemon->loop, {[daemon](const configured_view &view) { take_configuration(daemon, view); },
-                       [daemon] { return tunneld_state(*daemon); }});
+        daemon->loop,
+        {[daemon](const configured_view &view) { take_configuration(daemon, view); },
+         [daemon] { return tunneld_state(*daemon); },
+         [daemon](uint8_t group, const std::string &text) { hear_owners(daemon, group, text); }});
     return daemon->management != nullptr;
 }
 

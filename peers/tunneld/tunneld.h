@@ -13,6 +13,7 @@
 #include "peers/tunneld/health.h"
 #include "peers/tunneld/plane.h"
 #include "peers/tunneld/session.h"
+#include "peers/tunneld/slot_owners.h"
 #include "peers/tunneld/sorting_rules.h"
 #include "peers/tunneld/wanted_state.h"
 
@@ -55,6 +56,7 @@ struct tunneld {
     std::map<uint16_t, bool> roles;    // of the policy groups of groups with an intercept: ACTIVE
     std::map<uint8_t, outage> outages;
     std::vector<uint32_t> own_addresses;
+    owners_table owners;
 
     std::vector<wanted_link> links; // that are there, or were wanted last
     std::optional<wanted_state> applied;

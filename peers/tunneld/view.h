@@ -79,6 +79,21 @@ struct accepted_source {
     bool operator==(const accepted_source &) const = default;
 };
 
+// The fields of a packet that decide on its slot where routers assign by mask, or a value of them.
+struct slot_mask {
+    uint32_t src_ip = 0, dst_ip = 0;
+    uint16_t src_port = 0, dst_port = 0;
+    bool operator==(const slot_mask &) const = default;
+};
+// Whom the flows of a group belong to that this appliance doesn't know.
+struct group_protection {
+    bool by_mask = false;
+    slot_mask mask;
+    std::vector<uint32_t> members; // the other appliances of the group
+    std::vector<uint32_t> targets; // by slot: a member, or 0 for nobody
+    bool operator==(const group_protection &) const = default;
+};
+
 struct appliance_view {
     std::map<uint16_t, tunnel_ends> tunnels; // by tunnel id
     std::map<uint8_t, group_view> groups;
@@ -86,5 +101,6 @@ struct appliance_view {
     std::map<uint8_t, intercept_condition> conditions;
     std::vector<bypass_entry> bypasses; // without those whose time is over
     std::vector<accepted_source> accepted;
-    std::vector<uint32_t> own_addresses; // of this host, without 127.0.0.0/8
+    std::map<uint8_t, group_protection> protections; // none while flows are not protected
+    std::vector<uint32_t> own_addresses;             // of this host, without 127.0.0.0/8
 };

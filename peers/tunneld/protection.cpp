@@ -1,0 +1,84 @@
+#include "peers/tunneld/protection.h"
+
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+
+#include "runtime/logging.h"
+#include "runtime/ttime.h"
+
+namespace {
+
+constexpr size_t FILE_MAX = 4 << 20; // bytes
+
+int64_t now_s() {
+    return lt_monotonic_ms() / 1000;
+}
+
+// A reader finds the old file or the new one.
+void write_file(const char *path, const std::string &text) {
+    const std::string fresh = std::string(path) + ".new";
+    (void)mkdir("/run/tunneld", 0755);
+    std::ofstream file(fresh, std::ios::trunc);
+    file << text;
+    file.close();
+    if (!file || rename(fresh.c_str(), path) != 0)
+        LC_LOG(LC_LOG_WARNING, "%s: %s", path, strerror(errno));
+}
+
+std::string read_file(const char *path) {
+    std::ifstream file(path);
+    std::string text(FILE_MAX, '\0');
+    file.read(text.data(), static_cast<std::streamsize>(text.size()));
+    text.resize(static_cast<size_t>(file.gcount()));
+    return text;
+}
+
+} // namespace
+
+owners_table load_owners() {
+    return read_owners_file(read_file(OWNERS_FILE), now_s());
+}
+
+bool take_owners(owners_table *owners, uint8_t group, const std::string &text, uint32_t protection_s) {
+    owners_report report;
+    if (text.empty()) // nothing is known yet
+        return false;
+    if (!parse_owners(text, &report)) {
+        LC_LOG(LC_LOG_WARNING, "Group %d: the owners of its slots cannot be read", group);
+        return false;
+    }
+    if (!note_owners(owners, group, report, now_s(), protection_s))
+        return false;
+    write_file(OWNERS_FILE, owners_file_text(*owners));
+    return true;
+}
+
+void keep_owners_of(owners_table *owners, const std::map<uint8_t, group_view> &groups) {
+    if (std::erase_if(*owners, [&](const auto &each) { return !groups.contains(each.first); }) > 0)
+        write_file(OWNERS_FILE, owners_file_text(*owners));
+}
+
+std::map<uint8_t, group_protection> find_protections(const owners_table &owners,
+                                                     const std::map<uint8_t, group_view> &groups,
+                                                     uint32_t protection_s) {
+    std::map<uint8_t, group_protection> out;
+    if (protection_s == 0)
+        return out;
+    for (const auto &[number, group] : owners) {
+        const auto view = groups.find(number);
+        if (view == groups.end() || view->second.local == 0)
+            continue;
+        group_protection &made = out[number];
+        made.by_mask = group.by_mask;
+        made.mask = group.mask;
+        for (const uint32_t member : group.members)
+            if (member != view->second.local)
+                made.members.push_back(member);
+        made.targets = slot_targets(group, view->second.local, now_s(), protection_s);
+    }
+    return out;
+}

@@ -1,0 +1,24 @@
+// Protection of flows whose slot has moved: what wccpd says of the owners of slots, kept beyond the life of
+// the process, and what follows from it for the view.
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <string>
+
+#include "peers/tunneld/session.h"
+#include "peers/tunneld/slot_owners.h"
+#include "peers/tunneld/view.h"
+
+constexpr const char *OWNERS_FILE = "/run/tunneld/owners";
+
+// What an earlier tunneld has kept. A file that is missing or bad is an empty table.
+owners_table load_owners();
+// Takes in wccpd's text about a group and keeps what has changed. True when something has.
+bool take_owners(owners_table *owners, uint8_t group, const std::string &text, uint32_t protection_s);
+// Drops groups that are no longer configured.
+void keep_owners_of(owners_table *owners, const std::map<uint8_t, group_view> &groups);
+// Of the groups whose address and members are known. None when the time is 0.
+std::map<uint8_t, group_protection> find_protections(const owners_table &owners,
+                                                     const std::map<uint8_t, group_view> &groups,
+                                                     uint32_t protection_s);
