@@ -16,7 +16,9 @@
 #define NODE_BYPASS_CONFIG "/qv/tunneld/bypass/config"       // by prefix
 #define NODE_ACCEPT_CONFIG "/qv/tunneld/accept/config"       // by address
 #define NODE_PROTECTION_CONFIG "/qv/tunneld/protection/config"
-#define NODE_PROTECTION_TIME NODE_PROTECTION_CONFIG "/time" // seconds that flows are protected; 0: they are not
+#define NODE_PROTECTION_TIME                                                                                 \
+    NODE_PROTECTION_CONFIG "/time"                      // seconds that flows are protected; 0: they are not
+#define NODE_DRAIN_TIME "/qv/tunneld/drain/config/time" // seconds that a drain may take
 #define NODE_SYSLOG "/logging/syslog"
 #define NODE_SYSLOG_FACILITY NODE_SYSLOG "/facility"
 #define NODE_SYSTEM_FACILITY NODE_SYSLOG_FACILITY "/system"
@@ -38,10 +40,11 @@
 #define NODE_ALARMS_RAISED NODE_ALARM_STATE "/raised" // by type and source
 #define NODE_ROLES NODE_ALARM_STATE "/role"           // by group
 #define NODE_LEFT_GROUPS NODE_ALARM_STATE "/left"     // out of their routers for a time, by group
+#define NODE_DRAINS NODE_ALARM_STATE "/drain"         // being emptied, or out, because an operator asked
 
 #define NODE_CONFIG_STATE "/mgmtd/config/state"
-#define NODE_CONFIG_TEXT NODE_CONFIG_STATE "/text"  // the configuration as its file has it
-#define NODE_COMMITS NODE_CONFIG_STATE "/commit"    // the commits that are kept, by number
+#define NODE_CONFIG_TEXT NODE_CONFIG_STATE "/text" // the configuration as its file has it
+#define NODE_COMMITS NODE_CONFIG_STATE "/commit"   // the commits that are kept, by number
 
 // --- Events
 #define EVENT_CONFIG_CHANGE "/mgmtd/notify/dbchange" // after each commit
@@ -52,6 +55,10 @@
 #define EVENT_GROUP_LEAVE "/qv/tunneld/events/group_leave"
 #define EVENT_GROUP_JOIN "/qv/tunneld/events/group_join"
 #define EVENT_PROXY_CHANGE "/qv/tunneld/events/proxy_change"
+#define EVENT_GROUP_WEIGHT "/qv/tunneld/events/group_weight"     // announce so many percent of the weight
+#define EVENT_DRAIN_PROGRESS "/qv/tunneld/events/drain_progress" // flows left
+// From mgmtd: a drain begins, changes or ends. NODE_DRAINS has those that there are.
+#define EVENT_DRAIN "/qv/tunneld/events/drain"
 #define EVENT_PROCESS_CRASH "/pm/events/failure/crash"
 #define EVENT_PROCESS_EXIT "/pm/events/failure/unexpected_exit"
 #define EVENT_PROCESS_TERMINATE "/pm/events/proc/terminate"
@@ -65,7 +72,10 @@
 #define ACTION_REMOVE_INTEREST "/mgmtd/events/actions/interest/remove"
 #define ACTION_CONFIRM "/mgmtd/config/actions/confirm"
 #define ACTION_REPORT_PROCESS "/mgmtd/process/actions/report"
+#define ACTION_DRAIN "/qv/tunneld/drain/actions/begin"
+#define ACTION_DRAIN_CANCEL "/qv/tunneld/drain/actions/cancel"
 
 // --- Alarm types
 #define ALARM_TYPE_ADJACENCY 196638  // no router reports this appliance
 #define ALARM_TYPE_ASSIGNMENT 196639 // a router's table is not the designated appliance's
+#define ALARM_TYPE_OVERLOAD 196640   // a proxy has more flows than its intercept allows

@@ -556,7 +556,8 @@ TEST_F(Mgmtd, CommitsAreKeptOverAStart) {
         std::string out;
         const std::vector<history_entry> &all = daemon.kept.entries;
         for (size_t i = all.size() - std::min<size_t>(all.size(), 3); i < all.size(); i++)
-            out += std::to_string(all[i].number) + " " + all[i].cause + (all[i].returns_to ? " waits; " : "; ");
+            out +=
+                std::to_string(all[i].number) + " " + all[i].cause + (all[i].returns_to ? " waits; " : "; ");
         return out;
     };
     const auto weight = [&] { return daemon.tree.nodes[named(GROUP + "/weight")].text; };
@@ -590,7 +591,8 @@ TEST_F(Mgmtd, CommitsAreKeptOverAStart) {
         // The weight is given twice, which is no matter of the history.
         history_open(&daemon.kept, content(), daemon.say);
         EXPECT_EQ(history() == before, !replaced);
-        EXPECT_TRUE(access(pending.c_str(), F_OK) != 0 && access((pending + ".unfinished").c_str(), F_OK) != 0);
+        EXPECT_TRUE(access(pending.c_str(), F_OK) != 0 &&
+                    access((pending + ".unfinished").c_str(), F_OK) != 0);
     }
     EXPECT_EQ(history_find(daemon.kept, 5)->cause, "cut");
 
@@ -607,7 +609,8 @@ TEST_F(Mgmtd, CommitsAreKeptOverAStart) {
               static_cast<uint32_t>(LC_BAD_ARGUMENT));
     EXPECT_EQ(weight() + std::to_string(daemon.tree.revision), "3" + std::to_string(at));
 
-    // One that waits to be confirmed: nothing else is taken, and it is undone in time, also by the next mgmtd.
+    // One that waits to be confirmed: nothing else is taken, and it is undone in time, also by the next
+    // mgmtd.
     const auto tick = [&](int64_t seconds) {
         clock += seconds;
         now += seconds * 1000;
@@ -688,7 +691,8 @@ TEST_F(Mgmtd, WhoMayOnlyLookChangesNothingAndSeesNoPassword) {
         (void)set({{bn_set_modify, GROUP + "/password", "geheim"}}, flags);
         EXPECT_TRUE(refused()) << "nor a check, which would tell whether the password is right";
     }
-    for (const char *name : {ACTION_CONFIRM, "/mgmtd/process/actions/report", "/mgmtd/time/actions/zonechange"}) {
+    for (const char *name :
+         {ACTION_CONFIRM, "/mgmtd/process/actions/report", "/mgmtd/time/actions/zonechange"}) {
         action(4, name, {});
         EXPECT_TRUE(refused()) << name;
     }
@@ -707,7 +711,8 @@ TEST_F(Mgmtd, WhoMayOnlyLookChangesNothingAndSeesNoPassword) {
             ASSERT_EQ(found().size(), 1u) << name;
             const bool shown = found()[0].find(name == one ? "geheim" : "secret") != std::string::npos;
             EXPECT_EQ(shown, peer_id == 3) << found()[0];
-            EXPECT_EQ(found()[0].find("geheim before") != std::string::npos, peer_id == 3 && name != GROUP + "/password");
+            EXPECT_EQ(found()[0].find("geheim before") != std::string::npos,
+                      peer_id == 3 && name != GROUP + "/password");
         }
     for (const char *node : {"/51/debug", "/debug_all"}) {
         clear();
@@ -1113,6 +1118,105 @@ TEST_F(Mgmtd, AGroupThatIsOutOfItsRoutersIsDownForWccpdAlone) {
     EXPECT_TRUE(daemon.left.empty());
     EXPECT_EQ(set({{bn_set_create, GROUP + "/interface", "eth0"}}), 0u);
     EXPECT_TRUE(has(changes(), admin + "=->up"));
+}
+
+TEST_F(Mgmtd, AGroupThatIsDrainedAnnouncesNothingAndLeavesOnceItIsEmpty) {
+    const std::string admin = GROUP + "/admin", weight = GROUP + "/weight", drain = NODE_DRAINS "/51";
+    const auto report = [&](const char *event, std::vector<event_field> more) {
+        more.push_back({"group", {bn_type_uint8, "51"}});
+        clear();
+        EXPECT_TRUE(give(5, make_event(event, more)));
+        return changes();
+    };
+    const auto act = [&](const char *name, const std::vector<event_field> &fields = {}) {
+        clear();
+        action(3, name, fields);
+        return changes();
+    };
+    const auto slow_down = [&](const char *percent) {
+        return report(EVENT_GROUP_WEIGHT, {{"percent", {bn_type_uint32, percent}}});
+    };
+    const auto count = [&](const char *flows, const char *empty) {
+        return report(EVENT_DRAIN_PROGRESS,
+                      {{"flows", {bn_type_uint32, flows}}, {"empty", {bn_type_bool, empty}}});
+    };
+    const auto state = [&](const std::string &below = "") {
+        query(3, drain + below, bn_query_get);
+        return found().empty() ? "" : found().front().substr(drain.size() + below.size() + 1);
+    };
+    const auto tick = [&](int64_t after_ms) {
+        clear();
+        now += after_ms;
+        (void)server_tick(&daemon);
+        return changes();
+    };
+    ASSERT_EQ(set({{bn_set_create, GROUP + "/interface", "eth0"},
+                   {bn_set_create, weight, "7"},
+                   {bn_set_create, NODE_INTERCEPT_CONFIG "/51/ports", "80"},
+                   {bn_set_create, NODE_INTERCEPT_CONFIG "/51/to", "3128"}}),
+              0u);
+    server_peer_opened(&daemon, 5, "tunneld-9");
+    // The steps of a slow start; what is configured meanwhile comes in its part. No step is less than 1.
+    EXPECT_EQ(slow_down("20"), strings{weight + "=7>1"});
+    EXPECT_EQ(slow_down("20"), strings{});
+    EXPECT_EQ(slow_down("40"), strings{weight + "=1>2"});
+    EXPECT_EQ(set({{bn_set_modify, weight, "10"}}), 0u);
+    EXPECT_EQ(changes(), strings{weight + "=2>4"});
+    query(3, weight, bn_query_get);
+    EXPECT_EQ(found(), strings{weight + "=10"});
+    // A drain takes the rest, and a new tunneld may still follow.
+    EXPECT_EQ(act(ACTION_DRAIN, {{"group", {bn_type_uint8, "51"}}}), strings{weight + "=4>0"});
+    EXPECT_EQ(server_tick(&daemon), now + 60000) << "the configured time";
+    EXPECT_EQ(act(ACTION_DRAIN, {{"seconds", {bn_type_uint32, "9"}}}), strings{}) << "all groups, anew";
+    EXPECT_EQ(slow_down("60"), strings{});
+    EXPECT_EQ(slow_down("100"), strings{});
+    EXPECT_EQ(count("3", "false"), strings{});
+    EXPECT_EQ(state() + " " + state("/flows"), "draining 3");
+    query(1, weight, bn_query_get);
+    EXPECT_EQ(found(), strings{weight + "=0"});
+    EXPECT_EQ(count("0", "true"), strings{admin + "=up>down"});
+    EXPECT_EQ(state(), "drained");
+    server_peer_closed(&daemon, 5);
+    EXPECT_EQ(tick(100000), strings{}) << "it stays out";
+    EXPECT_EQ(act(ACTION_DRAIN), strings{});
+    EXPECT_EQ(act(ACTION_DRAIN_CANCEL), (strings{weight + "=0>10", admin + "=down>up"}));
+    EXPECT_EQ(state(), "");
+    EXPECT_EQ(act(ACTION_DRAIN_CANCEL), strings{});
+    EXPECT_EQ(message(), "There is no drain");
+    // Without tunneld, or with flows that don't end, by its time.
+    for (const bool followed : {false, true}) {
+        if (followed) {
+            server_peer_opened(&daemon, 5, "tunneld-10");
+            EXPECT_EQ(slow_down("80"), strings{weight + "=10>8"});
+        }
+        (void)act(ACTION_DRAIN, {{"seconds", {bn_type_uint32, "9"}}});
+        if (followed) {
+            EXPECT_EQ(count("5", "false"), strings{});
+        }
+        EXPECT_EQ(tick(8999), strings{});
+        EXPECT_EQ(tick(1), strings{admin + "=up>down"});
+        EXPECT_EQ(state(), "over");
+        (void)act(ACTION_DRAIN_CANCEL, {{"group", {bn_type_uint8, "51"}}});
+    }
+    // What a tunneld that is gone for good has slowed down gets its weight back.
+    server_peer_closed(&daemon, 5);
+    EXPECT_EQ(tick(LEFT_KEEP_MS - 1), strings{});
+    EXPECT_EQ(tick(1), strings{weight + "=8>10"});
+    EXPECT_NE(content().find("weight = 10"), std::string::npos);
+    const struct {
+        std::vector<event_field> fields;
+        const char *refused;
+    } bad[] = {{{{"group", {bn_type_str, "256"}}}, "group is no number between 0 and 255"},
+               {{{"group", {bn_type_str, "7"}}}, "There is no group 7"},
+               {{{"seconds", {bn_type_str, "86401"}}}, "seconds is no number between 0 and 86400"}};
+    for (const auto &one : bad) {
+        EXPECT_EQ(act(ACTION_DRAIN, one.fields), strings{});
+        EXPECT_EQ(message(), one.refused);
+    }
+    (void)act(ACTION_DRAIN);
+    EXPECT_EQ(set({{bn_set_delete, GROUP, ""}}), 0u);
+    EXPECT_TRUE(daemon.drains.empty());
+    EXPECT_EQ(state(), "");
 }
 
 // --- Bypasses

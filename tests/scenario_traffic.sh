@@ -28,7 +28,7 @@ proxied() { # NODE ADDRESS KEEP [TEXT]...
 ready() { # GROUP APPLIANCE...
     local group=$1 node; shift
     router_is r1 60 "$group" "([\$g.assignment.buckets[]?, \$g.assignment.masks[]?.values[].owner] | unique | length == $# and all(.[]; .))"
-    for node; do state_is "$node" 20 intercept '.["51"].proxy == "up"'; done
+    for node; do state_is "$node" 20 intercept '.["51"] | .proxy == "up" and .active'; done
 }
 # Nodes of tunneld below /qv/tunneld/KIND/state, as nested objects.
 state() { # NODE KIND

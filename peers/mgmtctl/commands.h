@@ -9,14 +9,14 @@
 // What a script can rely on.
 enum ctl_exit : int {
     CTL_OK = 0,
-    CTL_REFUSED = 1,     // mgmtd or wccpd said no; nothing was changed
-    CTL_USAGE = 2,       // the command line
-    CTL_UNREACHABLE = 3, // no mgmtd, no answer, or the session was lost
-    CTL_NOT_FOUND = 4,   // no such node or group
-    CTL_PARTLY = 5,      // no longer given: every command is one commit
+    CTL_REFUSED = 1,      // mgmtd or wccpd said no; nothing was changed
+    CTL_USAGE = 2,        // the command line
+    CTL_UNREACHABLE = 3,  // no mgmtd, no answer, or the session was lost
+    CTL_NOT_FOUND = 4,    // no such node or group
+    CTL_PARTLY = 5,       // no longer given: every command is one commit
     CTL_WOULD_CHANGE = 1, // apply --check: there is a difference; every failure is 2
-    CTL_STANDING = 6,    // alarms --check: an alarm is active
-    CTL_OUTPUT = 7,      // standard output took not all of it
+    CTL_STANDING = 6,     // alarms --check: an alarm is active
+    CTL_OUTPUT = 7,       // standard output took not all of it
 };
 
 struct ctl_options {
@@ -51,6 +51,8 @@ int ctl_policy(const ctl_options &options, const std::vector<std::string> &words
 int ctl_intercept(const ctl_options &options, const std::vector<std::string> &words);
 int ctl_bypass(const ctl_options &options, const std::vector<std::string> &words);
 int ctl_tunnel(const ctl_options &options, const std::vector<std::string> &words);
+// Groups emptied before they leave their routers (drain.cpp): "drain 51 for 60 wait".
+int ctl_drain(const ctl_options &options, const std::vector<std::string> &words);
 
 // The configuration as a whole (config_cli.cpp).
 struct ctl_apply_options {

@@ -44,8 +44,8 @@ static bool get_config(connection *mgmtd, const std::string &name, const std::st
     *out_revision = reply.revision;
     if (config_parse(reply.bindings[0].value, name, out))
         return true;
-    mgmtd->code = tell_failure(mgmtd->options, {CTL_REFUSED, "", "what mgmtd answers can't be read: " + out->errors,
-                                                "", 0});
+    mgmtd->code = tell_failure(mgmtd->options,
+                               {CTL_REFUSED, "", "what mgmtd answers can't be read: " + out->errors, "", 0});
     return false;
 }
 
@@ -194,7 +194,8 @@ int ctl_apply(const ctl_options &options, const std::string &file, const ctl_app
     uint32_t revision = 0;
     if (!mgmtd.session || !get_present(&mgmtd, &present, &revision))
         return apply_code(how, mgmtd.code);
-    if (!read_config(content, file == "-" ? "standard input" : file, present.tree, how.merge, &wanted, &errors)) {
+    if (!read_config(content, file == "-" ? "standard input" : file, present.tree, how.merge, &wanted,
+                     &errors)) {
         errors.pop_back();
         return tell_failure(options, {CTL_USAGE, "", errors, "", 0});
     }
@@ -206,11 +207,12 @@ int ctl_confirm(const ctl_options &options) {
     ctl_reply reply;
     if (!mgmtd.session)
         return mgmtd.code;
-    if (!ctl_action(mgmtd.session.get(), ACTION_CONFIRM, &reply, &mgmtd.reason))
+    if (!ctl_action(mgmtd.session.get(), ACTION_CONFIRM, {}, &reply, &mgmtd.reason))
         return mgmtd.lost();
     if (reply.code != 0)
         return tell_failure(options, {exit_of(reply.code), "", reply.message, "", reply.code});
-    put(options.json ? json_line({{"confirmed", reply.message}, {"exit", 0}}) : reply.message + " confirmed\n");
+    put(options.json ? json_line({{"confirmed", reply.message}, {"exit", 0}})
+                     : reply.message + " confirmed\n");
     return CTL_OK;
 }
 
@@ -287,7 +289,8 @@ static ctl_json json_commit(const kept_commit &commit) {
 }
 
 static std::string text_commit(const kept_commit &commit) {
-    std::string out = commit.number + std::string(commit.number.size() < 5 ? 6 - commit.number.size() : 1, ' ') +
+    std::string out = commit.number +
+                      std::string(commit.number.size() < 5 ? 6 - commit.number.size() : 1, ' ') +
                       local_time(commit.time, "%F %T  ") + (commit.user.empty() ? "-" : commit.user) + "  " +
                       commit.cause + "\n";
     if (commit.changes != "0")
@@ -336,8 +339,8 @@ static bool choose_commits(connection *mgmtd, uint32_t *inout_from) {
     if (!get_history(mgmtd, &commits))
         return false;
     if (commits.size() < 2)
-        mgmtd->code = tell_failure(mgmtd->options, {CTL_NOT_FOUND, "", "there is no commit before the last one",
-                                                    "", LC_NOT_FOUND});
+        mgmtd->code = tell_failure(
+            mgmtd->options, {CTL_NOT_FOUND, "", "there is no commit before the last one", "", LC_NOT_FOUND});
     else
         *inout_from = static_cast<uint32_t>(std::strtoul(commits[1].number.c_str(), nullptr, 10));
     return *inout_from != 0;
@@ -352,7 +355,8 @@ int ctl_diff(const ctl_options &options, uint32_t from, uint32_t to) {
         return mgmtd.code;
     const std::vector<node_change> changes = config_changes(before.tree, after.tree);
     if (options.json)
-        put(json_line({{"from", from}, {"to", revision}, {"changes", json_changes(changes, options.secrets)}}));
+        put(json_line(
+            {{"from", from}, {"to", revision}, {"changes", json_changes(changes, options.secrets)}}));
     else
         put_changes(options, changes);
     return CTL_OK;

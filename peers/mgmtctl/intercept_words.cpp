@@ -102,6 +102,9 @@ const std::vector<intercept_word> &intercept_words() {
         {"fall", "fall", "failed checks in a row until it counts as down, 1 to 100", take_one},
         {"leave", "leave_after",
          "seconds that the proxy is down before the group leaves its routers; 0: never", take_one},
+        {"limit", "limit", "flows of the proxy, above which new ones are returned; 0: none", take_one},
+        {"slow_start", "slow_start", "seconds from a start of the proxy until the whole weight is announced",
+         take_one},
     };
     return words;
 }

@@ -26,6 +26,9 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
 traffic_result bypass_command(const ctl_link &link, const std::vector<std::string> &words, int64_t now);
 traffic_result tunnel_command(const ctl_link &link, const std::vector<std::string> &words);
 
+// `words` follow "drain"; it prints, and gives the exit code.
+int run_drain(const ctl_options &options, const ctl_link &link, const std::vector<std::string> &words);
+
 // What is configured and what tunneld answers, printed. They give the exit code.
 int tell_intercepts(const ctl_options &options, const ctl_link &link, const std::string &only);
 int tell_bypasses(const ctl_options &options, const ctl_link &link);

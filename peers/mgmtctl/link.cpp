@@ -31,5 +31,9 @@ ctl_link link_to_mgmtd(const ctl_options &options) {
                              std::string *out_reason) {
         return held->open(out_reason) && ctl_set(held->session, items, order, out, out_reason);
     };
+    link.action = [held](const std::string &name, const std::vector<ctl_binding> &bindings, ctl_reply *out,
+                         std::string *out_reason) {
+        return held->open(out_reason) && ctl_action(held->session, name, bindings, out, out_reason);
+    };
     return link;
 }

@@ -13,6 +13,9 @@ struct ctl_link {
         query;
     std::function<bool(const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *out_reason)>
         set;
+    std::function<bool(const std::string &name, const std::vector<ctl_binding> &bindings, ctl_reply *out,
+                       std::string *out_reason)>
+        action;
     int64_t settle_ms = 5000;  // how long wccpd may take to follow
     int64_t session_ms = 3000; // how long tunneld may take to open its session
 };

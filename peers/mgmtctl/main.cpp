@@ -189,14 +189,17 @@ static void add_config_commands(command_line *line) {
     const CLI::Range commits(1u, UINT32_MAX);
     CLI::App *apply = add_command(line, "apply", "make FILE the configuration: one commit",
                                   [line] { return ctl_apply(line->options, line->name, line->apply); });
-    apply->add_option("FILE", line->name, "a configuration, as mgmtd's file has it or as JSON; - for standard input")
+    apply
+        ->add_option("FILE", line->name,
+                     "a configuration, as mgmtd's file has it or as JSON; - for standard input")
         ->required();
-    CLI::Option *check = apply->add_flag("--check", line->apply.check,
-                                         "change nothing; exit with 1 when it would, 0 when not, 2 for errors");
+    CLI::Option *check = apply->add_flag(
+        "--check", line->apply.check, "change nothing; exit with 1 when it would, 0 when not, 2 for errors");
     apply->add_flag("--yes", line->apply.yes, "don't ask");
     apply->add_flag("--merge", line->apply.merge, "what FILE doesn't name stays as it is");
-    apply->add_option("--confirm", line->apply.confirm_minutes,
-                      "undo it after so many minutes, unless \"mgmtctl confirm\" follows")
+    apply
+        ->add_option("--confirm", line->apply.confirm_minutes,
+                     "undo it after so many minutes, unless \"mgmtctl confirm\" follows")
         ->check(CLI::Range(1u, CTL_CONFIRM_MAX_MINUTES))
         ->excludes(check);
     add_command(line, "confirm", "keep what was applied with --confirm",
@@ -207,10 +210,13 @@ static void add_config_commands(command_line *line) {
     CLI::App *diff = add_command(line, "diff", "what the last commit changed, or all since commit FROM",
                                  [line] { return ctl_diff(line->options, line->from, line->to); });
     diff->add_option("FROM", line->from, "the number of a commit")->check(commits);
-    diff->add_option("TO", line->to, "the number of another, instead of the configuration as it is")->check(commits);
-    add_command(line, "rollback", "go back to a commit: a commit of its own", [line] {
-        return ctl_rollback(line->options, line->from);
-    })->add_option("COMMIT", line->from, "its number")->check(commits)->required();
+    diff->add_option("TO", line->to, "the number of another, instead of the configuration as it is")
+        ->check(commits);
+    add_command(line, "rollback", "go back to a commit: a commit of its own",
+                [line] { return ctl_rollback(line->options, line->from); })
+        ->add_option("COMMIT", line->from, "its number")
+        ->check(commits)
+        ->required();
 }
 
 // Of a command whose words begin with what to do, with that.
@@ -220,6 +226,12 @@ static std::string cause_of(const command_line &line) {
         if (word == begins && !line.words.empty())
             return word + " " + line.words.front();
     return word;
+}
+
+static void add_drain_command(command_line *line) {
+    add_command(line, "drain", "empty groups before they leave: [GROUP] [for S] [wait], cancel, show",
+                [line] { return ctl_drain(line->options, line->words); })
+        ->add_option("WORD", line->words);
 }
 
 static void add_show_command(command_line *line) {
@@ -257,6 +269,7 @@ int main(int argc, char **argv) {
     add_group_commands(&line);
     add_traffic_commands(&line);
     add_config_commands(&line);
+    add_drain_command(&line);
     add_show_command(&line);
     add_shell_command(&line);
 

@@ -308,7 +308,8 @@ bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, co
              ctl_reply *out, std::string *out_reason) {
     static constexpr uint32_t subops[] = {bn_set_create, bn_set_modify, bn_set_delete, bn_set_reset};
     owned_request msg;
-    const uint32_t flags = (order.check_only ? bn_cf_check_only : 0u) | (order.ends_wait ? bn_cf_ends_wait : 0u) |
+    const uint32_t flags = (order.check_only ? bn_cf_check_only : 0u) |
+                           (order.ends_wait ? bn_cf_ends_wait : 0u) |
                            order.confirm_minutes << bn_cf_minutes_shift;
     if (bn_set_request_msg_create(&msg.pointer, flags) != LC_OK || add_person(msg.pointer) != LC_OK)
         return no_memory(out_reason);
@@ -326,8 +327,8 @@ bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, co
     return send_request(session, msg.pointer, out, out_reason);
 }
 
-static bool send_action(ctl_session *session, const std::string &name,
-                        const std::vector<ctl_binding> &bindings, ctl_reply *out, std::string *out_reason) {
+bool ctl_action(ctl_session *session, const std::string &name, const std::vector<ctl_binding> &bindings,
+                ctl_reply *out, std::string *out_reason) {
     owned_request msg;
     if (bn_action_request_msg_create(&msg.pointer, name.c_str()) != LC_OK)
         return no_memory(out_reason);
@@ -340,17 +341,13 @@ static bool send_action(ctl_session *session, const std::string &name,
     return send_request(session, msg.pointer, out, out_reason);
 }
 
-bool ctl_action(ctl_session *session, const std::string &name, ctl_reply *out, std::string *out_reason) {
-    return send_action(session, name, {}, out, out_reason);
-}
-
 bool ctl_add_interest(ctl_session *session, const std::string &event,
                       const std::vector<std::string> &patterns, std::string *out_reason) {
     std::vector<ctl_binding> bindings = {{"event_name", "name", event}};
     for (size_t i = 0; i < patterns.size(); i++)
         bindings.push_back({"match/" + std::to_string(i + 1) + "/pattern", "string", patterns[i]});
     ctl_reply reply;
-    if (!send_action(session, ACTION_ADD_INTEREST, bindings, &reply, out_reason))
+    if (!ctl_action(session, ACTION_ADD_INTEREST, bindings, &reply, out_reason))
         return false;
     return reply.code == 0 || fail(out_reason, reply.message);
 }

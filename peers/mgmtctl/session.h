@@ -58,8 +58,9 @@ struct ctl_order {
 };
 bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, const ctl_order &order,
              ctl_reply *out, std::string *out_reason);
-// An action of mgmtd's without bindings.
-bool ctl_action(ctl_session *session, const std::string &name, ctl_reply *out, std::string *out_reason);
+// Has mgmtd carry out an action.
+bool ctl_action(ctl_session *session, const std::string &name, const std::vector<ctl_binding> &bindings,
+                ctl_reply *out, std::string *out_reason);
 // Asks for an event, only with a binding that matches one of the patterns when there are any.
 bool ctl_add_interest(ctl_session *session, const std::string &event,
                       const std::vector<std::string> &patterns, std::string *out_reason);

@@ -44,6 +44,10 @@ static const state_row<traffic_intercept> intercept_rows[] = {
     {"proxy_ms", [](traffic_intercept *i, const std::string &v) { i->proxy_ms = number(v); }},
     {"active", [](traffic_intercept *i, const std::string &v) { i->active = v != "false"; }},
     {"left", [](traffic_intercept *i, const std::string &v) { i->left = v == "true"; }},
+    {"flows", [](traffic_intercept *i, const std::string &v) { i->flows = number_of<int64_t>(v, -1); }},
+    {"overloaded", [](traffic_intercept *i, const std::string &v) { i->overloaded = v == "true"; }},
+    {"weight_percent",
+     [](traffic_intercept *i, const std::string &v) { i->weight_percent = number_of<uint32_t>(v, 100); }},
 };
 
 template <typename Subject, size_t COUNT>
@@ -64,6 +68,7 @@ const std::vector<sorted_way> &sorted_ways() {
         {"forwarded", "forwarded"},
         {"dropped", "dropped"},
         {"own", "own"},
+        {"overload", "overload"},
     };
     return ways;
 }
@@ -151,6 +156,22 @@ static void take_left(const std::vector<std::string> &parts, const std::string &
         out->left[group] = clean_text(value, 63);
 }
 
+void take_drain(const std::vector<std::string> &parts, const std::string &value,
+                std::vector<traffic_drain> *inout) {
+    traffic_drain *drain = entry_of(inout, &traffic_drain::group, parts[0]);
+    if (drain && parts.size() == 1)
+        drain->state = clean_text(value, 15);
+    else if (drain && parts[1] == "flows")
+        drain->flows = number_of<int64_t>(value, -1);
+    else if (drain && parts[1] == "until")
+        drain->until = number_of<int64_t>(value, 0);
+}
+
+static void take_drained(const std::vector<std::string> &parts, const std::string &value,
+                         traffic_state *out) {
+    take_drain(parts, value, &out->drains);
+}
+
 bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
     static const struct {
         const char *root;
@@ -159,7 +180,7 @@ bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
     } walks[] = {
         {NODE_PLANE_STATE, true, take_plane},         {NODE_TUNNEL_STATE, true, take_tunnel},
         {NODE_INTERCEPT_STATE, true, take_intercept}, {NODE_ACCEPT_CONFIG, false, take_accepted},
-        {NODE_LEFT_GROUPS, false, take_left},
+        {NODE_LEFT_GROUPS, false, take_left},         {NODE_DRAINS, false, take_drained},
     };
     *out = {};
     out->tunneld = tunneld_condition::running;
@@ -216,6 +237,20 @@ std::string proxy_text(const traffic_intercept &intercept) {
     std::string out = "proxy " + (intercept.proxy.empty() ? "unknown" : intercept.proxy);
     if (intercept.proxy_ms > 0)
         out += " " + duration_text(intercept.proxy_ms);
+    if (intercept.flows >= 0)
+        out += ", " + std::to_string(intercept.flows) + " flows";
+    return out;
+}
+
+std::string drain_text(const traffic_drain &drain, int64_t now) {
+    std::string out = drain.state == "over" ? "has left" : drain.state;
+    if (drain.flows > 0 || (drain.flows == 0 && drain.state == "draining"))
+        out += (drain.state == "over" ? " with " : ", ") + std::to_string(drain.flows) +
+               (drain.flows == 1 ? " flow" : " flows") + (drain.state == "over" ? "" : " left");
+    else if (drain.state == "over")
+        out += " by its time"; // nobody has counted
+    if (drain.state == "draining")
+        out += ", at most " + std::to_string(std::max<int64_t>(drain.until - now, 0)) + " s more";
     return out;
 }
 
@@ -267,6 +302,30 @@ static void left_groups(const traffic_state &state, const reason_list &list) {
                  group);
 }
 
+static void drains(const traffic_state &state, const reason_list &list) {
+    for (const traffic_drain &each : state.drains)
+        list.add("group " + std::to_string(each.group) +
+                     (each.state == "draining" ? ": is drained; new flows don't go to the proxy"
+                                               : ": drained, and out of its routers until \"drain cancel\""),
+                 each.group);
+}
+
+static void overloads(const traffic_state &state, const reason_list &list) {
+    for (const traffic_intercept &each : state.intercepts)
+        if (each.overloaded)
+            list.add("group " + std::to_string(each.group) +
+                         ": the proxy has too many flows; new ones are returned",
+                     each.group);
+}
+
+static void slow_starts(const traffic_state &state, const reason_list &list) {
+    for (const traffic_intercept &each : state.intercepts)
+        if (each.weight_percent < 100)
+            list.add("group " + std::to_string(each.group) +
+                         ": slow start; a part of the weight is announced",
+                     each.group);
+}
+
 static void proxies_down(const traffic_state &state, const reason_list &list) {
     for (const traffic_intercept &each : state.intercepts)
         if (each.proxy == "down" && !state.left.contains(each.group))
@@ -278,8 +337,7 @@ static void proxies_down(const traffic_state &state, const reason_list &list) {
 static void standing_by(const traffic_state &state, const reason_list &list) {
     for (const traffic_intercept &each : state.intercepts)
         if (!each.active)
-            list.add("group " + std::to_string(each.group) +
-                         ": not ACTIVE in its policy group; new flows are returned",
+            list.add("group " + std::to_string(each.group) + ": not ACTIVE; new flows are returned",
                      each.group);
 }
 
@@ -292,6 +350,9 @@ std::vector<traffic_reason> traffic_reasons(const traffic_state &state) {
         {"failure", failing_kernel},
         {"left", left_groups},
         {"proxy_down", proxies_down},
+        {"drain", drains},
+        {"overload", overloads},
+        {"slow_start", slow_starts},
         {"standing_by", standing_by},
         {"own_traffic", own_traffic},
         {"refused_source", refused_sources},

@@ -33,7 +33,17 @@ struct traffic_intercept {
     uint64_t proxy_ms = 0;           // how long it has been that
     bool active = true;              // no role keeps new flows from the proxy
     bool left = false;               // the group is out of its routers
+    int64_t flows = -1;              // of the proxy; -1 unknown
+    bool overloaded = false;         // new flows are returned for that
+    uint32_t weight_percent = 100;   // that is announced during a slow start
     sorted_counts sorted;
+};
+// A group that is emptied, or has been, because an operator asked.
+struct traffic_drain {
+    int group = 0;
+    std::string state;  // "draining", "drained", "over": it has left with flows
+    int64_t flows = -1; // that are left; -1 unknown
+    int64_t until = 0;  // seconds since 1970
 };
 enum class tunneld_condition { running, silent, absent };
 struct traffic_state {
@@ -48,10 +58,14 @@ struct traffic_state {
     std::vector<traffic_intercept> intercepts;       // by group
     // From mgmtd, also without a tunneld:
     std::map<std::string, std::string>
-        accepted;                    // sources beside the routers; only beside this one, "" for all
-    std::map<int, std::string> left; // why a group is out of its routers, by group
+        accepted;                      // sources beside the routers; only beside this one, "" for all
+    std::map<int, std::string> left;   // why a group is out of its routers, by group
+    std::vector<traffic_drain> drains; // by group
 };
 
+// What a node below NODE_DRAINS says, by the parts of its name.
+void take_drain(const std::vector<std::string> &parts, const std::string &value,
+                std::vector<traffic_drain> *inout);
 // False: no answer.
 bool gather_traffic(const ctl_ask &ask, traffic_state *out);
 
@@ -64,6 +78,8 @@ const std::vector<sorted_way> &sorted_ways();
 std::string sorted_text(const sorted_counts &counts);
 std::string proxy_text(const traffic_intercept &intercept); // "proxy up 0:10:40"
 const char *tunneld_word(tunneld_condition condition);      // "running", "silent", "absent"
+
+std::string drain_text(const traffic_drain &drain, int64_t now); // "draining, 12 flows left, ..."
 
 // Why traffic does not go where somebody would expect it to.
 struct traffic_reason {

@@ -168,7 +168,7 @@ static int list_clauses(const ctl_options &options) {
     for (const intercept_word &word : intercept_words()) {
         const char *fallback = intercept_word_fallback(word);
         if (!options.json)
-            put(word.word + std::string(10 - std::string(word.word).size(), ' ') + word.values +
+            put(word.word + std::string(12 - std::string(word.word).size(), ' ') + word.values +
                 (fallback && *fallback ? std::string("; default ") + fallback : "") + "\n");
         all.push_back({{"word", word.word},
                        {"node", word.node},

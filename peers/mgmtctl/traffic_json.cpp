@@ -32,8 +32,9 @@ static ctl_json tunnel_json(const traffic_tunnel &tunnel) {
 }
 
 ctl_json intercept_state_json(const traffic_intercept *intercept) {
-    ctl_json out = {{"proxy", nullptr},  {"proxy_reason", nullptr}, {"proxy_ms", nullptr},
-                    {"active", nullptr}, {"left", nullptr},         {"sorted", nullptr}};
+    ctl_json out = {{"proxy", nullptr},      {"proxy_reason", nullptr},   {"proxy_ms", nullptr},
+                    {"active", nullptr},     {"left", nullptr},           {"flows", nullptr},
+                    {"overloaded", nullptr}, {"weight_percent", nullptr}, {"sorted", nullptr}};
     if (!intercept)
         return out;
     out["proxy"] = text_or_null(intercept->proxy);
@@ -41,7 +42,20 @@ ctl_json intercept_state_json(const traffic_intercept *intercept) {
     out["proxy_ms"] = intercept->proxy_ms;
     out["active"] = intercept->active;
     out["left"] = intercept->left;
+    out["flows"] = intercept->flows < 0 ? ctl_json(nullptr) : ctl_json(intercept->flows);
+    out["overloaded"] = intercept->overloaded;
+    out["weight_percent"] = intercept->weight_percent;
     out["sorted"] = sorted_json(intercept->sorted);
+    return out;
+}
+
+ctl_json drains_json(const std::vector<traffic_drain> &drains) {
+    ctl_json out = ctl_json::array();
+    for (const traffic_drain &drain : drains)
+        out.push_back({{"group", drain.group},
+                       {"state", drain.state},
+                       {"flows", drain.flows < 0 ? ctl_json(nullptr) : ctl_json(drain.flows)},
+                       {"until", drain.until}});
     return out;
 }
 
@@ -58,6 +72,7 @@ ctl_json traffic_json(const traffic_state &state) {
                     {"tunnels", ctl_json::array()},
                     {"intercepts", ctl_json::array()},
                     {"left", ctl_json::array()},
+                    {"drains", drains_json(state.drains)},
                     {"reasons", ctl_json::array()}};
     for (const traffic_tunnel &tunnel : state.tunnels)
         out["tunnels"].push_back(tunnel_json(tunnel));

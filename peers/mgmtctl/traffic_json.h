@@ -6,5 +6,6 @@
 #include "peers/mgmtctl/traffic.h"
 
 ctl_json traffic_json(const traffic_state &state);
+ctl_json drains_json(const std::vector<traffic_drain> &drains);
 // What tunneld answers about one intercept, null: nothing.
 ctl_json intercept_state_json(const traffic_intercept *intercept);

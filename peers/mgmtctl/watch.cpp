@@ -134,6 +134,28 @@ static std::string proxy_text(const event_row &row, const ctl_event &event) {
                                            : subject + ": down" + with_reason(", ", reason_of(event));
 }
 
+static ctl_json weight_json(const event_row &row, const ctl_event &event) {
+    ctl_json out = group_json(row, event);
+    out["percent"] = number(value_of(event, "percent"));
+    return out;
+}
+static std::string weight_text(const event_row &row, const ctl_event &event) {
+    return group_text(row, event) + value_of(event, "percent") + " % of its weight";
+}
+
+static ctl_json drain_json(const event_row &row, const ctl_event &event) {
+    const std::string flows = value_of(event, "flows");
+    ctl_json out = group_json(row, event);
+    out["state"] = clean_text(value_of(event, "state"), 15);
+    out["flows"] = flows.empty() ? ctl_json(nullptr) : number(flows);
+    return out;
+}
+static std::string drain_text(const event_row &row, const ctl_event &event) {
+    const std::string flows = value_of(event, "flows");
+    return row.words + value_of(event, "group") + ": " + clean_text(value_of(event, "state"), 15) +
+           (flows.empty() ? "" : ", " + flows + " flows left");
+}
+
 static std::string process_of(const ctl_event &event) {
     return event.bindings.empty() ? "" : event.bindings[0].value;
 }
@@ -158,6 +180,8 @@ static const event_row rows[] = {
     {EVENT_PROXY_CHANGE, "proxy", "proxy of group ", proxy_json, proxy_text},
     {EVENT_GROUP_LEAVE, "group_leave", " leaves its routers", leave_json, leave_text},
     {EVENT_GROUP_JOIN, "group_join", " joins its routers again", group_json, group_text},
+    {EVENT_GROUP_WEIGHT, "weight", " announces ", weight_json, weight_text},
+    {EVENT_DRAIN, "drain", "drain of group ", drain_json, drain_text},
     {EVENT_PROCESS_CRASH, "process_crash", " crashed", process_json, process_text},
     {EVENT_PROCESS_EXIT, "process_exit", " ended unexpectedly", process_json, process_text},
     {EVENT_PROCESS_TERMINATE, "process_terminate", " was terminated", process_json, process_text},

@@ -136,6 +136,7 @@ void server_take_over(server *self, node_tree next, const commit_result &commit)
     server_show_commits(self);
     send_change_events(self, before, commit);
     server_forget_deleted_groups(self);
+    server_forget_deleted_drains(self);
     self->expire_at_ms = 0;
 }
 
@@ -221,7 +222,8 @@ int64_t server_expire_bypasses(server *self) {
             wait_ms = std::min(wait_ms < 0 ? CLOCK_LOOK_MS : wait_ms, (until - clock) * 1000);
     }
     if (!over.empty() &&
-        server_commit(self, over, {"mgmtd (bypasses whose time is over)", "mgmtd", "bypasses whose time is over"})
+        server_commit(self, over,
+                      {"mgmtd (bypasses whose time is over)", "mgmtd", "bypasses whose time is over"})
                 .code != 0)
         wait_ms = CLOCK_LOOK_MS; // refused, as when the file cannot be written
     return self->expire_at_ms = wait_ms < 0 ? -1 : now + wait_ms;

@@ -1,6 +1,5 @@
 // Groups that are out of their routers because tunneld says so: their proxy is down. That is an operational
-// state. The file and the queries of others have what is configured; only wccpd is given "down" for the
-// group's admin, in answers and in change events, for as long as it lasts.
+// state, which wccpd sees through its overlay (overlays.cpp).
 //
 // It ends when tunneld says so, with the group, and when nobody is left who could: with the intercept while
 // tunneld is away, or once no tunneld has had a session for a time. A tunneld that has been started again
@@ -17,19 +16,15 @@ bool server_runs_groups(const peer &who) {
     return who.name.starts_with("wccpd-");
 }
 
-static bool is_tunneld(const peer &who) {
+bool server_is_tunneld(const peer &who) {
     return who.name.starts_with("tunneld-");
 }
 
-static bool has_tunneld(const server *self) {
+bool server_has_tunneld(const server *self) {
     for (const auto &[id, who] : self->peers)
-        if (is_tunneld(who))
+        if (server_is_tunneld(who))
             return true;
     return false;
-}
-
-static node_name admin_of(uint8_t group) {
-    return parsed_name(NODE_GROUP_CONFIG).below(std::to_string(group)).below("admin");
 }
 
 static node_name report_of(uint8_t group) {
@@ -40,47 +35,14 @@ static bool exists(const server *self, const char *root, uint8_t group) {
     return self->tree.nodes.contains(parsed_name(root).below(std::to_string(group)));
 }
 
-// --- What wccpd sees
-
-static bool is_covered(const server *self, const node_name &name) {
-    if (self->left.empty() || name.parts.back() != "admin")
-        return false;
-    for (const auto &[group, left] : self->left)
-        if (name == admin_of(group))
-            return true;
-    return false;
-}
-
-node_value server_value_for_wccpd(const server *self, const node_name &name, const node_value &value) {
-    return is_covered(self, name) ? node_value{value.type, "down"} : value;
-}
-
-void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout) {
-    std::erase_if(*inout, [&](node_change &change) {
-        if (!is_covered(self, change.name))
-            return false;
-        for (std::optional<node_value> *value : {&change.before, &change.after})
-            if (*value)
-                (*value)->text = "down";
-        return change.before == change.after;
-    });
-}
-
-// The group's admin for wccpd, from one to the other; nothing for a group that is configured down.
-static void send_admin(server *self, uint8_t group, const char *before, const char *after) {
-    const node_name name = admin_of(group);
-    const auto found = self->tree.nodes.find(name);
-    if (found != self->tree.nodes.end() && found->second.text == "up")
-        server_send_to_wccpd(self, {{name, node_value{bn_type_str, before}, node_value{bn_type_str, after}}});
-}
-
 // --- Reports
 
-static bool read_group(const server *self, uint32_t peer_id, const std::vector<event_field> &fields,
-                       uint8_t *out_group) {
+bool server_read_reported_group(const server *self, uint32_t peer_id, const std::vector<event_field> &fields,
+                                uint8_t *out_group) {
     const std::string *group = find_field(fields, "group");
     std::string text;
-    if (!is_tunneld(self->peers.at(peer_id)) || !group || !canonical_text(bn_type_uint8, *group, &text))
+    if (!server_is_tunneld(self->peers.at(peer_id)) || !group ||
+        !canonical_text(bn_type_uint8, *group, &text))
         return false;
     *out_group = static_cast<uint8_t>(std::stoi(text));
     return true;
@@ -92,18 +54,20 @@ static std::string read_reason(const std::vector<event_field> &fields) {
 }
 
 static void end_leave(server *self, uint8_t group, const std::string &why) {
+    const group_overlay before = server_overlay_of(self, group);
     if (self->left.erase(group) == 0)
         return;
     server_remove_report(self, report_of(group));
     self->say("group " + std::to_string(group) + " joins its routers again: " + why);
     server_send_event(self, EVENT_GROUP_JOIN, {{"group", {bn_type_uint8, std::to_string(group)}}});
-    send_admin(self, group, "down", "up");
+    server_send_overlay(self, group, before);
 }
 
 void server_take_leave(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     uint8_t group = 0;
-    if (!read_group(self, peer_id, fields, &group) || !exists(self, NODE_GROUP_CONFIG, group))
+    if (!server_read_reported_group(self, peer_id, fields, &group) || !exists(self, NODE_GROUP_CONFIG, group))
         return;
+    const group_overlay before = server_overlay_of(self, group);
     const bool first = !self->left.contains(group);
     self->left[group] = {peer_id, 0};
     const node_name report = report_of(group);
@@ -113,12 +77,12 @@ void server_take_leave(server *self, uint32_t peer_id, const std::vector<event_f
     self->state[report.below("since")] = server_time_now();
     self->say("group " + std::to_string(group) + " leaves its routers: " + self->state[report].text);
     server_send_event(self, EVENT_GROUP_LEAVE, fields);
-    send_admin(self, group, "up", "down");
+    server_send_overlay(self, group, before);
 }
 
 void server_take_join(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     uint8_t group = 0;
-    if (read_group(self, peer_id, fields, &group))
+    if (server_read_reported_group(self, peer_id, fields, &group))
         end_leave(self, group, "reported by tunneld");
 }
 
@@ -126,7 +90,7 @@ void server_take_join(server *self, uint32_t peer_id, const std::vector<event_fi
 void server_take_proxy_change(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     uint8_t group = 0;
     const std::string *up = find_field(fields, "up");
-    if (!read_group(self, peer_id, fields, &group) || !up)
+    if (!server_read_reported_group(self, peer_id, fields, &group) || !up)
         return;
     self->say("proxy of group " + std::to_string(group) +
               (*up == "true" ? ": up" : ": down, " + read_reason(fields)));
@@ -154,7 +118,7 @@ void server_forget_deleted_groups(server *self) {
 
 int64_t server_drop_left_groups(server *self) {
     const int64_t now = self->now_ms();
-    const bool followed = has_tunneld(self);
+    const bool followed = server_has_tunneld(self);
     int64_t next = -1;
     for (auto at = self->left.begin(); at != self->left.end();) {
         const auto [group, left] = *at++;

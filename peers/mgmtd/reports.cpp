@@ -4,6 +4,7 @@
 //   /qv/alarms/state/role/GROUP                  the role's name; below it code, since
 //   /qv/alarms/state/left/GROUP                  why it is out of its routers; below it since
 //   (left_groups.cpp)
+//   /qv/alarms/state/drain/GROUP                 draining, drained, over (drains.cpp)
 //
 // TYPE is the number of the alarm, SOURCE says what it is about. A report that comes again replaces the one
 // before. Alarms are not resent by whoever raised them, so those of a session that ends are taken as
@@ -98,6 +99,8 @@ static const struct {
     {EVENT_GROUP_LEAVE, server_take_leave, true},
     {EVENT_GROUP_JOIN, server_take_join, true},
     {EVENT_PROXY_CHANGE, server_take_proxy_change},
+    {EVENT_GROUP_WEIGHT, server_take_weight, true},
+    {EVENT_DRAIN_PROGRESS, server_take_drain_progress, true},
 };
 
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,

@@ -192,6 +192,13 @@ static action_answer confirm(server *self, uint32_t peer_id, const std::vector<e
     return {result.code, result.message};
 }
 
+template <uint32_t (*Run)(server *, const std::vector<event_field> &, std::string *)>
+static action_answer run_action(server *self, uint32_t, const std::vector<event_field> &fields) {
+    action_answer out{};
+    out.code = Run(self, fields, &out.message);
+    return out;
+}
+
 static const struct {
     const char *name;
     action_answer (*run)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
@@ -202,6 +209,8 @@ static const struct {
     {ACTION_CONFIRM, confirm},
     {ACTION_REPORT_PROCESS, report_process},
     {"/mgmtd/time/actions/zonechange", report_zone},
+    {ACTION_DRAIN, run_action<server_begin_drain>},
+    {ACTION_DRAIN_CANCEL, run_action<server_cancel_drain>},
 };
 
 static std::string text_of(const tstring *text) {
@@ -312,6 +321,7 @@ void server_peer_closed(server *self, uint32_t peer_id) {
         server_answer_without(self, query, LC_IO_CLOSED, name + " ended its session before it answered");
     server_forget_reports(self, peer_id);
     server_orphan_left_groups(self, peer_id);
+    server_orphan_weights(self, peer_id);
 }
 
 static void answer_late_queries(server *self) {
@@ -340,6 +350,7 @@ int64_t server_tick(server *self) {
     answer_late_queries(self);
     take_earlier(&next, server_drop_left_groups(self));
     take_earlier(&next, server_return_unconfirmed(self));
+    take_earlier(&next, server_end_drains(self));
     take_earlier(&next, server_expire_bypasses(self));
     for (const auto &[id, query] : self->pending) // also those that have gone on to another daemon
         take_earlier(&next, query.deadline_ms);

@@ -12,8 +12,8 @@
 #include "peers/mgmtd/config_file.h"
 #include "peers/mgmtd/history.h"
 #include "peers/mgmtd/messages.h"
-#include "peers/nodes/node_tree.h"
 #include "peers/mgmtd/router_addresses.h"
+#include "peers/nodes/node_tree.h"
 
 constexpr int64_t MONITOR_TIMEOUT_MS = 5000;
 constexpr size_t ALARMS_MAX = 4096; // that are kept
@@ -76,11 +76,29 @@ struct left_group {
     uint32_t reporter;   // tunneld's session, 0 when it has ended
     int64_t orphaned_ms; // when it has
 };
+// A group that announces less than its weight, because tunneld says so.
+struct slowed_group {
+    uint32_t percent;
+    uint32_t reporter; // as of a group that is out of its routers
+    int64_t orphaned_ms;
+};
 constexpr int64_t LEFT_KEEP_MS = 10000; // without a session of tunneld
+// A group that an operator wants emptied, so that it can leave its routers without breaking a connection. It
+// stays out until the operator says so.
+struct drain_request {
+    int64_t until_ms; // monotonic; then it leaves, whatever is left
+    bool left = false;
+    int64_t flows = -1; // that the proxy still has, by tunneld's last report; -1 unknown
+};
+// What wccpd is given instead of what is configured.
+struct group_overlay {
+    bool down = false;
+    uint32_t weight_percent = 100;
+};
 
 // Who makes a commit, what for and on which conditions.
 struct commit_order {
-    std::string who;         // in lines of the log
+    std::string who;                   // in lines of the log
     std::string user = {}, cause = {}; // in the history
     bool check_only = false;
     uint32_t revision = 0;        // that it was made for; 0: any
@@ -107,7 +125,7 @@ struct server {
     config_comments comments;
     history kept;
     int64_t return_at_ms = -1; // when the commit that waits to be confirmed is undone; -1: not known yet
-    node_map state; // nodes that mgmtd itself reports
+    node_map state;            // nodes that mgmtd itself reports
     std::map<uint32_t, peer> peers;
     std::map<uint32_t, pending_query> pending;    // by the message id of the forwarded query
     size_t pending_bytes = 0, gathered_bytes = 0; // of all pending queries
@@ -115,6 +133,8 @@ struct server {
     uint32_t next_query_id = 0x40000000;          // apart from the ids of other messages
     uint64_t peers_seen = 0;
     std::map<uint8_t, left_group> left;
+    std::map<uint8_t, slowed_group> slowed;
+    std::map<uint8_t, drain_request> drains;
     int64_t expire_at_ms = 0; // when bypass entries are looked at again; -1: not before a commit
 };
 
@@ -164,10 +184,29 @@ void server_take_proxy_change(server *self, uint32_t peer_id, const std::vector<
 void server_orphan_left_groups(server *self, uint32_t peer_id);
 int64_t server_drop_left_groups(server *self); // the time of the next look, or -1
 bool server_runs_groups(const peer &who);      // it is wccpd's
-// The value of the node as wccpd is to see it.
+bool server_is_tunneld(const peer &who);
+bool server_has_tunneld(const server *self);
+// The group that a report of tunneld is about. False: nobody else reports, or there is no number.
+bool server_read_reported_group(const server *self, uint32_t peer_id, const std::vector<event_field> &fields,
+                                uint8_t *out_group);
+void server_forget_deleted_groups(server *self);
+
+// Groups that announce less than their weight, and drains, in drains.cpp. Actions give 0, or a code with the
+// reason.
+void server_take_weight(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+void server_take_drain_progress(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
+uint32_t server_begin_drain(server *self, const std::vector<event_field> &fields, std::string *out_message);
+uint32_t server_cancel_drain(server *self, const std::vector<event_field> &fields, std::string *out_message);
+int64_t server_end_drains(server *self); // those whose time is over; the time of the next look, or -1
+void server_orphan_weights(server *self, uint32_t peer_id);
+void server_forget_deleted_drains(server *self);
+
+// What wccpd is given, in overlays.cpp.
+group_overlay server_overlay_of(const server *self, uint8_t group);
 node_value server_value_for_wccpd(const server *self, const node_name &name, const node_value &value);
 void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout);
-void server_forget_deleted_groups(server *self);
+// After a change: wccpd gets the values that differ.
+void server_send_overlay(server *self, uint8_t group, const group_overlay &before);
 void server_send_to_wccpd(server *self, const std::vector<node_change> &changes);
 
 // Commits that are kept, in kept_commits.cpp.

@@ -119,12 +119,15 @@ static const std::vector<schema_row> rows = [] {
         {INTERCEPT "/rise", bn_type_uint32, "2", 1, 100, nullptr, nullptr},
         {INTERCEPT "/fall", bn_type_uint32, "3", 1, 100, nullptr, nullptr},
         {INTERCEPT "/leave_after", bn_type_uint32, "30", 0, 86400, nullptr, nullptr},
+        {INTERCEPT "/limit", bn_type_uint32, "0", 0, 10'000'000, nullptr, nullptr},
+        {INTERCEPT "/slow_start", bn_type_uint32, "0", 0, 86400, nullptr, nullptr},
         {BYPASS, bn_type_ipv4prefix, nullptr, 0, 0, nullptr, check_prefix, true},
         {BYPASS "/until", bn_type_uint32, "0", 0, NUMBER_MAX, nullptr, nullptr},
         {ACCEPT, bn_type_ipv4addr, nullptr, 0, 0, nullptr, check_host_address, true},
         {ACCEPT "/router", bn_type_ipv4addr, "0.0.0.0", 0, 0, nullptr, check_host_address_or_none},
 
         {NODE_PROTECTION_TIME, bn_type_uint32, "300", 0, 86400, nullptr, nullptr},
+        {NODE_DRAIN_TIME, bn_type_uint32, "60", 0, 86400, nullptr, nullptr},
 
         {NODE_SYSTEM_FACILITY, bn_type_uint32, "136", 0, 184, nullptr, check_facility},
         {NODE_SYSLOG "/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level},
@@ -197,7 +200,7 @@ const std::vector<const char *> &wccpd_state_nodes() {
     node "/in", node "/in_bytes", node "/to_proxy", node "/to_proxy_bytes", node "/bypassed",                \
         node "/bypassed_bytes", node "/returned", node "/returned_bytes", node "/down", node "/down_bytes",  \
         node "/forwarded", node "/forwarded_bytes", node "/dropped", node "/dropped_bytes", node "/own",     \
-        node "/own_bytes", node "/passed", node "/passed_bytes"
+        node "/own_bytes", node "/passed", node "/passed_bytes", node "/overload", node "/overload_bytes"
 
 const std::vector<const char *> &tunneld_state_nodes() {
     static const std::vector<const char *> nodes = {
@@ -227,6 +230,9 @@ const std::vector<const char *> &tunneld_state_nodes() {
         NODE_INTERCEPT_STATE "/*/proxy_ms",
         NODE_INTERCEPT_STATE "/*/active",
         NODE_INTERCEPT_STATE "/*/left",
+        NODE_INTERCEPT_STATE "/*/flows",
+        NODE_INTERCEPT_STATE "/*/overloaded",
+        NODE_INTERCEPT_STATE "/*/weight_percent",
         SORTED(NODE_INTERCEPT_STATE "/*"),
         NODE_PROTECTION_STATE "/time",
         NODE_PROTECTION_STATE "/passed",
@@ -489,7 +495,9 @@ const char *alarm_name(const std::string &type) {
     static const struct {
         int type;
         const char *name;
-    } alarms[] = {{ALARM_TYPE_ADJACENCY, "adjacency"}, {ALARM_TYPE_ASSIGNMENT, "assignment"}};
+    } alarms[] = {{ALARM_TYPE_ADJACENCY, "adjacency"},
+                  {ALARM_TYPE_ASSIGNMENT, "assignment"},
+                  {ALARM_TYPE_OVERLOAD, "overload"}};
     for (const auto &alarm : alarms)
         if (type == std::to_string(alarm.type))
             return alarm.name;

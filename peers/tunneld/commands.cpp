@@ -188,7 +188,8 @@ uint32_t carry_out(command_desk *desk, const mailbox_command &command, uint32_t 
 void watch_wccpd(command_desk *desk, int64_t now_ms) {
     bool lives = false;
     const int32_t pid = cmem_find_creator(WCCP_MAILBOX_NAME, &lives);
-    if (pid == 0 || !lives || pid == desk->wccpd_pid)
+    desk->wccpd_lives = pid != 0 && lives;
+    if (!desk->wccpd_lives || pid == desk->wccpd_pid)
         return;
     const int32_t before = desk->wccpd_pid ? desk->wccpd_pid : read_wccpd_pid();
     desk->wccpd_pid = pid;

@@ -57,6 +57,7 @@ struct command_desk {
     std::optional<mailbox_command> passed_over; // the command that is left unanswered, printed once
     std::map<uint16_t, uint32_t> roles;         // of policy groups, where not UNKNOWN
     int32_t wccpd_pid = 0;                      // that the tunnels were ordered by; 0 unknown
+    bool wccpd_lives = false;                   // by the last look
     int64_t unordered_until_ms = -1;            // -1: no tunnel waits to be ordered anew
 };
 

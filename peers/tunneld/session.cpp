@@ -66,6 +66,7 @@ struct mgmt_link {
     gcl_session *session = nullptr;
     loop_event *timer = nullptr;
     enum { closed, greeting, opening, open } stage = closed;
+    uint32_t sessions = 0;
     int64_t connect_at_ms = 0, opened_ms = 0; // `opened_ms`: when the opening began
 
     request configuration, groups, routers, owners; // that are under way
@@ -79,6 +80,7 @@ struct mgmt_link {
     configured_view view;
     std::map<uint8_t, size_t> expected; // routers, by the groups that are up
     known_routers known;
+    std::map<uint8_t, group_role> roles;
     std::vector<std::string> complaints;
 };
 
@@ -98,10 +100,13 @@ bool send_request(mgmt_link *link, bn_request_msg *msg, request *out) {
 }
 
 bool send_queries(mgmt_link *link, uint32_t what, const std::vector<std::string> &names, uint32_t flags,
-                  request *out) {
+                  request *out, const std::vector<std::string> &single_nodes = {}) {
     owned_request msg;
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK)
         return false;
+    for (const std::string &node : single_nodes)
+        if (bn_query_request_msg_append_str(msg.pointer, bn_query_get, 0, node.c_str(), nullptr) != LC_OK)
+            return false;
     for (const std::string &name : names)
         if (bn_query_request_msg_append_str(msg.pointer, what, flags, name.c_str(), nullptr) != LC_OK)
             return false;
@@ -191,7 +196,7 @@ lc_status ignore_response(gcl_session *, bn_response_msg *, void *) {
 lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
     auto *link = static_cast<mgmt_link *>(data);
     const std::string name = msg->text ? ts_str(msg->text) : "";
-    if (name == EVENT_CONFIG_CHANGE)
+    if (name == EVENT_CONFIG_CHANGE || name == EVENT_DRAIN)
         link->read_at_ms = lt_monotonic_ms();
     ask_routers_now(link);
     advance_soon(link);
@@ -293,9 +298,10 @@ void connect_quietly(mgmt_link *link) {
 // An interest in changes is also what makes mgmtd ask this session for tunneld's state.
 void begin_session(mgmt_link *link) {
     link->stage = mgmt_link::open;
+    link->sessions++;
     LC_LOG(LC_LOG_NOTICE, "session with mgmtd open");
     if (!send_interest(link, EVENT_CONFIG_CHANGE, {"/qv/tunneld/**", NODE_WCCPD "/**"}) ||
-        !send_interest(link, EVENT_ROLE_CHANGE, {}))
+        !send_interest(link, EVENT_ROLE_CHANGE, {}) || !send_interest(link, EVENT_DRAIN, {}))
         LC_LOG(LC_LOG_WARNING, "changes of the configuration cannot be followed");
     link->read_at_ms = lt_monotonic_ms();
     for (auto &[key, known] : link->known) // while nobody could be asked they have not aged
@@ -371,7 +377,7 @@ void forget_old_routers(mgmt_link *link) {
     });
 }
 
-// Whether each group that is up has as many routers as are configured, all with their methods.
+// Whether each group that is up has as many routers as are configured, all with their methods, and is ACTIVE.
 bool knows_all_routers(const mgmt_link *link) {
     std::map<uint8_t, size_t> good;
     for (const auto &[key, known] : link->known) {
@@ -381,7 +387,9 @@ bool knows_all_routers(const mgmt_link *link) {
     }
     return std::all_of(link->expected.begin(), link->expected.end(), [&](const auto &each) {
         const auto found = good.find(each.first);
-        return each.second == 0 || (found != good.end() && found->second >= each.second);
+        const auto role = link->roles.find(each.first);
+        return each.second == 0 || (found != good.end() && found->second >= each.second &&
+                                    role != link->roles.end() && role->second.active);
     });
 }
 
@@ -394,12 +402,15 @@ void add_what_wccpd_says(const mgmt_link *link, configured_view *inout) {
         for (auto at = link->known.lower_bound({id, 0}); at != link->known.end() && at->first.first == id;
              ++at)
             group.routers.push_back(at->second.router);
+        const auto role = link->roles.find(id);
+        group.active = role != link->roles.end() && role->second.active;
+        group.alone = role != link->roles.end() && role->second.alone;
     }
 }
 
 bool same(const configured_view &a, const configured_view &b) {
     return a.groups == b.groups && a.intercepts == b.intercepts && a.bypasses == b.bypasses &&
-           a.accepted == b.accepted && a.protection_s == b.protection_s;
+           a.accepted == b.accepted && a.protection_s == b.protection_s && a.drains == b.drains;
 }
 
 bool wants_owners(const mgmt_link *link) {
@@ -409,16 +420,18 @@ bool wants_owners(const mgmt_link *link) {
 // The groups that wccpd runs are asked for by name: a question about another would be an error in its log.
 void ask_about_groups(mgmt_link *link) {
     static const node_name root = parsed_name(NODE_GROUP_STATE);
-    std::vector<std::string> walks, owners;
+    std::vector<std::string> walks, single_nodes, owners;
     for (const event_field &node : link->listed)
         if (const node_name name = parsed_name(node.name);
             name.is_under(root) && name.parts.size() == root.parts.size() + 1) {
             walks.push_back(name.below("router").text());
             owners.push_back(name.below("owners").text());
+            for (const char *leaf : {"oper", "num_appliances"})
+                single_nodes.push_back(name.below(leaf).text());
         }
     link->listed.clear();
     if (!walks.empty() && link->routers_are_due)
-        (void)send_walks(link, walks, bn_qf_subtree, &link->routers);
+        (void)send_queries(link, bn_query_iterate, walks, bn_qf_subtree, &link->routers, single_nodes);
     if (!owners.empty() && wants_owners(link))
         (void)send_queries(link, bn_query_get, owners, 0, &link->owners);
 }
@@ -440,8 +453,10 @@ void digest(mgmt_link *link) {
     const bool answered = link->has_listed || link->has_states;
     if (link->has_listed)
         ask_about_groups(link);
-    if (link->has_states)
+    if (link->has_states) {
+        link->roles = read_group_roles(link->states);
         take_routers(link);
+    }
     if (answered)
         forget_old_routers(link);
     if (link->has_states)
@@ -480,7 +495,7 @@ void ask(mgmt_link *link) {
         link->read_at_ms = NEVER;
         if (!send_walks(link,
                         {NODE_GROUP_CONFIG, NODE_INTERCEPT_CONFIG, NODE_BYPASS_CONFIG, NODE_ACCEPT_CONFIG,
-                         NODE_PROTECTION_CONFIG},
+                         NODE_PROTECTION_CONFIG, NODE_DRAINS},
                         bn_qf_subtree, &link->configuration))
             link->read_at_ms = now + RETRY_MS;
     }
@@ -578,6 +593,10 @@ bool mgmt_link_is_open(const mgmt_link *link) {
     return link->stage == mgmt_link::open && is_connected(link);
 }
 
+uint32_t mgmt_link_session(const mgmt_link *link) {
+    return link->sessions;
+}
+
 void mgmt_link_ask_routers(mgmt_link *link) {
     if (link->stage != mgmt_link::open)
         return;
@@ -600,6 +619,32 @@ void mgmt_link_group_leaves(mgmt_link *link, uint8_t group, const std::string &r
 
 void mgmt_link_group_joins(mgmt_link *link, uint8_t group) {
     send_event(link, EVENT_GROUP_JOIN, {group_field(group)});
+}
+
+void mgmt_link_weight_changed(mgmt_link *link, uint8_t group, uint32_t percent) {
+    send_event(link, EVENT_GROUP_WEIGHT,
+               {group_field(group), {"percent", {bn_type_uint32, std::to_string(percent)}}});
+}
+
+void mgmt_link_drain_progress(mgmt_link *link, uint8_t group, uint32_t flows, bool empty) {
+    send_event(link, EVENT_DRAIN_PROGRESS,
+               {group_field(group),
+                {"flows", {bn_type_uint32, std::to_string(flows)}},
+                {"empty", {bn_type_bool, empty ? "true" : "false"}}});
+}
+
+void mgmt_link_overload(mgmt_link *link, uint8_t group, bool overloaded, const std::string &text) {
+    send_event(link, overloaded ? EVENT_RAISE_ALARM : EVENT_CLEAR_ALARM,
+               {{"alarm_type", {bn_type_uint32, std::to_string(ALARM_TYPE_OVERLOAD)}},
+                {"param_3", {bn_type_str, "proxy:grp:" + std::to_string(group)}},
+                {"comment", {bn_type_str, text}}});
+}
+
+void mgmt_link_forget_roles(mgmt_link *link) {
+    link->roles.clear();
+    for (auto &[id, group] : link->view.groups)
+        group.active = group.alone = false;
+    mgmt_link_ask_routers(link);
 }
 
 void mgmt_link_proxy_changed(mgmt_link *link, uint8_t group, bool up, const std::string &reason) {

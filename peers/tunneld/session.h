@@ -16,7 +16,8 @@ struct configured_view {
     std::map<uint8_t, intercept> intercepts;
     std::vector<bypass_entry> bypasses; // also those whose time is over
     std::vector<accepted_source> accepted;
-    uint32_t protection_s = 300; // that flows are passed on to the former owner of their slot; 0: never
+    uint32_t protection_s = 300;    // that flows are passed on to the former owner of their slot; 0: never
+    std::map<uint8_t, bool> drains; // that an operator has asked for, by group: whether it has left
 };
 
 // A state node that tunneld answers for: its full name, its type (bn_type_...) and its text.
@@ -37,12 +38,20 @@ struct mgmt_link; // owned by whoever made it
 mgmt_link *mgmt_link_new(lew *loop, session_callbacks callbacks);
 void mgmt_link_free(mgmt_link *link);
 bool mgmt_link_is_open(const mgmt_link *link);
+// The number of sessions that have been opened: what was reported in an earlier one has to be reported again.
+uint32_t mgmt_link_session(const mgmt_link *link);
 // wccpd's routers are asked for again shortly: to call when tunnels have come or gone.
 void mgmt_link_ask_routers(mgmt_link *link);
 // Events, dropped while there is no session. After a new session has read the configuration, groups that are
 // out of their routers are reported anew by the caller (`configured` is called then).
 void mgmt_link_group_leaves(mgmt_link *link, uint8_t group, const std::string &reason);
 void mgmt_link_group_joins(mgmt_link *link, uint8_t group);
+void mgmt_link_weight_changed(mgmt_link *link, uint8_t group, uint32_t percent);
+// `empty`: it may leave its routers.
+void mgmt_link_drain_progress(mgmt_link *link, uint8_t group, uint32_t flows, bool empty);
+void mgmt_link_overload(mgmt_link *link, uint8_t group, bool overloaded, const std::string &text);
+// What is known of the groups' roles is of a wccpd that is gone.
+void mgmt_link_forget_roles(mgmt_link *link);
 void mgmt_link_proxy_changed(mgmt_link *link, uint8_t group, bool up, const std::string &reason);
 // tunneld ends in order and has removed its tunnels. Whoever needs them has to be told at once: the next
 // tunneld, if one comes, has none to take over.

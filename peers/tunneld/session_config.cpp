@@ -135,6 +135,8 @@ constexpr intercept_node intercept_nodes[] = {
     {"rise", false, TAKE(take_number(text, 1, 1000, &out->check.rise))},
     {"fall", false, TAKE(take_number(text, 1, 1000, &out->check.fall))},
     {"leave_after", false, TAKE(take_number(text, 0, UINT32_MAX, &out->leave_after_s))},
+    {"limit", false, TAKE(take_number(text, 0, UINT32_MAX, &out->limit))},
+    {"slow_start", false, TAKE(take_number(text, 0, 86400, &out->slow_start_s))},
 };
 #undef TAKE
 
@@ -201,6 +203,11 @@ void read_group(reading *self, uint8_t group, const std::string &leaf, const std
     if (!good)
         self->complain("group " + std::to_string(group) + ": " + leaf + " \"" + shown_text(text) +
                        "\" ignored");
+}
+
+void read_drain(reading *self, uint8_t group, const std::string &leaf, const std::string &text) {
+    if (leaf.empty())
+        self->view.drains[group] = text != "draining";
 }
 
 // --- By instance
@@ -275,6 +282,7 @@ constexpr struct {
     {NODE_BYPASS_CONFIG, read_bypass},
     {NODE_ACCEPT_CONFIG, read_accepted},
     {NODE_PROTECTION_CONFIG, read_protection},
+    {NODE_DRAINS, read_by_group<read_drain>},
 };
 } // namespace
 
@@ -329,6 +337,23 @@ std::map<uint8_t, std::string> read_group_owners(const std::vector<event_field> 
         if (name.is_under(root) && name.parts.size() == depth + 2 && name.parts.back() == "owners" &&
             take_number(name.parts[depth], 0, 255, &group))
             out[group] = node.value.text;
+    }
+    return out;
+}
+
+std::map<uint8_t, group_role> read_group_roles(const std::vector<event_field> &nodes) {
+    static const node_name root = parsed_name(NODE_GROUP_STATE);
+    std::map<uint8_t, group_role> out;
+    for (const event_field &node : nodes) {
+        const node_name name = parsed_name(node.name);
+        std::string instance, leaf;
+        uint8_t group = 0;
+        if (!split_name(name, root, &instance, &leaf) || !take_number(instance, 0, 255, &group))
+            continue;
+        if (leaf == "oper") // "ACTIVE, DESIGNATED"
+            out[group].active = node.value.text.starts_with("ACTIVE");
+        else if (leaf == "num_appliances")
+            out[group].alone = node.value.text == "0" || node.value.text == "1";
     }
     return out;
 }

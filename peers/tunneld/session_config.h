@@ -32,6 +32,11 @@ std::map<uint8_t, size_t> count_configured_routers(const std::vector<event_field
 
 // From wccpd's answer: its text about the owners of slots, by group.
 std::map<uint8_t, std::string> read_group_owners(const std::vector<event_field> &nodes);
-// From wccpd's answer about groups: routers that have answered it, by group. Methods that are not negotiated
+// From wccpd's answer about groups: whether a router assigns to this appliance, and whether there is another.
+struct group_role {
+    bool active = false, alone = false;
+};
+std::map<uint8_t, group_role> read_group_roles(const std::vector<event_field> &nodes);
+// From the same answer: routers that have answered it, by group. Methods that are not negotiated
 // are unknown.
 std::map<uint8_t, std::vector<group_router>> read_group_routers(const std::vector<event_field> &nodes);

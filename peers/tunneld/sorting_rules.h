@@ -22,8 +22,10 @@ enum sorted_as : uint8_t {
                      // (returned)
     SORTED_FORWARDED,
     SORTED_DROPPED,
-    SORTED_OWN,    // the appliance's own traffic, redirected to itself
-    SORTED_PASSED, // of a flow that another appliance has
+    SORTED_OWN,      // the appliance's own traffic, redirected to itself
+    SORTED_PASSED,   // of a flow that another appliance has
+    SORTED_OWN,      // the appliance's own traffic, redirected to itself
+    SORTED_OVERLOAD, // wanted, but the proxy has as many flows as it may have: returned
     SORTED_WAYS
 };
 extern const char *const sorted_words[SORTED_WAYS]; // "in", "to_proxy", ...

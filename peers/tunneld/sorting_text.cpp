@@ -9,7 +9,7 @@
 #include "peers/tunneld/sorting_rules.h"
 
 const char *const sorted_words[SORTED_WAYS] = {"in",        "to_proxy", "bypassed", "returned", "down",
-                                               "forwarded", "dropped",  "own",      "passed"};
+                                               "forwarded", "dropped",  "own",      "passed",   "overload"};
 
 namespace {
 
@@ -125,7 +125,7 @@ void add_way_chains(content_maker &maker) {
     const auto count = [](const char *way) { return format("counter name iifname map @count_%s", way); };
     // A packet without a mark takes the way of its interface: back through a link, on from an L2 interface.
     const std::string unmarked = format("meta mark != 0x%08x ", MARK_LOCAL);
-    for (const char *way : {"returned", "bypassed", "own", "down"})
+    for (const char *way : {"returned", "bypassed", "own", "down", "overload"})
         maker.rules(way) = {count(way), unmarked + "meta mark set iifname map @give_back"};
     maker.rules("to_proxy") = {mark_as(MARK_LOCAL), count("to_proxy")};
     maker.rules("forwarded") = {unmarked + mark_as(MARK_FORWARD), count("forwarded")};
@@ -134,8 +134,8 @@ void add_way_chains(content_maker &maker) {
 }
 
 void add_group(content_maker &maker, const sorted_group &group) {
-    for (const sorted_as way :
-         {SORTED_TO_PROXY, SORTED_BYPASSED, SORTED_RETURNED, SORTED_DOWN, SORTED_FORWARDED, SORTED_DROPPED})
+    for (const sorted_as way : {SORTED_TO_PROXY, SORTED_BYPASSED, SORTED_RETURNED, SORTED_DOWN,
+                                SORTED_FORWARDED, SORTED_DROPPED, SORTED_OVERLOAD})
         maker.add_counter(format("group/%u/%s", group.group, sorted_words[way]));
     std::vector<std::string> &rules = maker.rules(group_chain(group.group));
     const intercept &wish = group.rules;
@@ -149,9 +149,14 @@ void add_group(content_maker &maker, const sorted_group &group) {
     // A flow that began before it was redirected stays with its server.
     if (wish.protocol == 6)
         rules.push_back(NOT_JUST_SYN + (" " + ends_as(SORTED_RETURNED, "returned")));
-    if (!group.condition.active || !group.condition.proxy_up) {
-        const bool drop = group.condition.active && wish.drop_when_down;
+    const intercept_condition &now = group.condition;
+    if (now.draining || !now.active || !now.proxy_up) {
+        const bool drop = (now.draining || now.active) && wish.drop_when_down;
         rules.push_back(ends_as(SORTED_DOWN, drop ? "down_dropped" : "down"));
+        return;
+    }
+    if (now.overloaded) {
+        rules.push_back(ends_as(SORTED_OVERLOAD, "overload"));
         return;
     }
     // The proxy may listen on any address, on one of the interface, or on 127.0.0.1. The statement ends the

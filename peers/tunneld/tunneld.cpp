@@ -1,9 +1,9 @@
 // The loop of the program and what it decides.
 //
 // wccpd wakes this process by a datagram when it has put a command into the mailbox. In case one is lost the
-// mailbox is looked at four times a second as well: wccpd waits for two seconds. Without a socket for wake-ups
-// it is looked at each millisecond for a second after a command, since more follow, and less often later.
-// Everything that is due now and then is done on the same timer.
+// mailbox is looked at four times a second as well: wccpd waits for two seconds. Without a socket for
+// wake-ups it is looked at each millisecond for a second after a command, since more follow, and less often
+// later. Everything that is due now and then is done on the same timer.
 //
 // A tunneld that is killed leaves its interfaces, routes and rules, and the next one takes them over. Until
 // it has read the configuration, however long that takes, it makes and removes tunnels as it is ordered to,
@@ -62,16 +62,6 @@ std::vector<uint32_t> find_own_addresses() {
 
 // --- What follows from what is known
 
-// Before its first check a proxy counts as up, as it was under the tunneld before; a gateway that fails
-// closed takes no chances.
-bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules) {
-    const auto &states = health_states(daemon.health);
-    const auto found = states.find(group);
-    if (found == states.end() || found->second.state == proxy_health::unknown)
-        return !rules.drop_when_down;
-    return found->second.state == proxy_health::up;
-}
-
 appliance_view view_appliance(const tunneld &daemon) {
     appliance_view view;
     for (const auto &[id, tunnel] : daemon.desk.tunnels)
@@ -81,8 +71,14 @@ appliance_view view_appliance(const tunneld &daemon) {
         if (const auto found = view.groups.find(group); found != view.groups.end())
             found->second.force_l2_return = forced;
     view.intercepts = daemon.configured.intercepts;
-    for (const auto &[group, rules] : view.intercepts)
-        view.conditions[group] = {is_proxy_up(daemon, group, rules), is_active_group(daemon, group)};
+    for (const auto &[group, rules] : view.intercepts) {
+        const auto followed = daemon.followed.find(group);
+        view.conditions[group] = {is_proxy_up(daemon, group, rules), is_active_group(daemon, group),
+                                  daemon.configured.drains.contains(group) && daemon.end_at_ms < 0,
+                                  followed != daemon.followed.end() && followed->second.decided.overloaded};
+    }
+    for (const lingering_link &each : daemon.lingering)
+        view.lingering.push_back(each.tunnel);
     const int64_t now = time(nullptr);
     for (const bypass_entry &entry : daemon.configured.bypasses)
         if (entry.until == 0 || entry.until > now)
@@ -150,8 +146,36 @@ void end_take_over(tunneld *daemon) {
     daemon->applied.reset();
 }
 
+bool has_ends(const command_desk &desk, const tunnel_ends &ends) {
+    return std::any_of(desk.tunnels.begin(), desk.tunnels.end(), [&](const auto &each) {
+        return each.second.local == ends.local && each.second.remote == ends.remote;
+    });
+}
+
+uint16_t free_tunnel_id(const command_desk &desk, uint16_t wanted) {
+    for (uint16_t id = wanted;; id--)
+        if (!desk.tunnels.contains(id))
+            return id;
+}
+
+// Of a tunnel that is deleted the link stays for a moment, with what is sent into it returned.
+void let_links_linger(tunneld *daemon) {
+    const int64_t until_ms = lt_monotonic_ms() + LINGER_MS;
+    std::erase_if(daemon->lingering,
+                  [&](const lingering_link &each) { return has_ends(daemon->desk, each.tunnel.ends); });
+    for (const wanted_link &link : daemon->links) {
+        const tunnel_ends ends = {link.wish.local, link.wish.remote};
+        const bool known = std::any_of(daemon->lingering.begin(), daemon->lingering.end(),
+                                       [&](const lingering_link &each) { return each.tunnel.ends == ends; });
+        if (daemon->active_ms >= 0 && !link.wish.accepted && !known && !has_ends(daemon->desk, ends))
+            daemon->lingering.push_back(
+                {{free_tunnel_id(daemon->desk, link.wish.tunnel_id), ends}, until_ms});
+    }
+}
+
 // What the table of commands asks for. A look at the kernel is due even where the table is as it was.
 void apply_tunnels(tunneld *daemon) {
+    let_links_linger(daemon);
     daemon->applied.reset();
     reconcile(daemon);
 }
@@ -253,17 +277,43 @@ void hear_owners(tunneld *daemon, uint8_t group, const std::string &text) {
         reconcile(daemon);
 }
 
+// A wccpd that has been killed leaves its roles in the mailbox, and here. Until the next one says that a
+// group is ACTIVE, only flows that there are go on.
+void forget_old_roles(tunneld *daemon) {
+    const command_desk &desk = daemon->desk;
+    if (desk.wccpd_lives && desk.wccpd_pid == daemon->roles_of_pid)
+        return;
+    const int32_t pid = desk.wccpd_lives ? desk.wccpd_pid : 0;
+    if (daemon->roles_of_pid == pid)
+        return;
+    daemon->roles_of_pid = pid;
+    for (auto &[id, group] : daemon->configured.groups)
+        group.active = group.alone = false;
+    if (daemon->management)
+        mgmt_link_forget_roles(daemon->management);
+}
+
+void note_activity(tunneld *daemon, int64_t now) {
+    for (const auto &[id, group] : daemon->configured.groups)
+        if (group.active)
+            daemon->active_ms = now;
+}
+
 // --- The loop
 
 void tick(tunneld *daemon, int64_t now) {
     watch_wccpd(&daemon->desk, now);
+    forget_old_roles(daemon);
+    note_activity(daemon, now);
     drop_unordered(&daemon->desk, now);
+    std::erase_if(daemon->lingering, [&](const lingering_link &each) { return now >= each.until_ms; });
     end_take_over(daemon);
     if (daemon->desk.options.roles && daemon->desk.attached)
         print_roles(&daemon->desk);
     read_roles(daemon);
     follow_health(daemon);
     daemon->own_addresses = find_own_addresses();
+    follow_groups(daemon);
     reconcile(daemon);
     if (now >= daemon->alive_at_ms && service_watchdog_ms() >= 0) {
         service_report("WATCHDOG=1");
@@ -285,6 +335,8 @@ void look_at_mailbox(int, short, void *data) {
         if (daemon->management)
             mgmt_link_ask_routers(daemon->management); // a new tunnel may mean a new router
     }
+    if (daemon->end_at_ms >= 0 && now >= daemon->end_at_ms)
+        LOG_STATUS(lew_escape_from_dispatch(daemon->loop));
     const int64_t pause =
         mailbox_pause_ms(daemon->desk.attached, daemon->wake_up >= 0, now - daemon->last_command_ms);
     LOG_STATUS(loop_event_set_timer(daemon->mailbox_timer, pause));
@@ -296,9 +348,29 @@ void be_woken(int fd, short, void *data) {
     look_at_mailbox(-1, 0, data);
 }
 
-lc_status take_signal(int number, short, void *, lew *loop) {
+// When the program may end. After wccpd has left its routers they go on sending for a moment, and what they
+// send is returned. One that still runs has left none, and has to see that tunneld is gone.
+int64_t find_end(tunneld *daemon, int64_t now) {
+    watch_wccpd(&daemon->desk, now);
+    if (daemon->plane == &table_plane || daemon->active_ms < 0 || daemon->desk.wccpd_lives)
+        return now;
+    int64_t end = daemon->active_ms + TICK_MS + LINGER_MS; // it is noted once a tick
+    for (const lingering_link &each : daemon->lingering)
+        end = std::max(end, each.until_ms);
+    return end;
+}
+
+lc_status take_signal(int number, short, void *data, lew *loop) {
+    auto *daemon = static_cast<tunneld *>(data);
+    const int64_t now = lt_monotonic_ms(), end = find_end(daemon, now);
     LC_LOG(LC_LOG_INFO, "Received %s", lc_signal_num_to_name(number));
-    return lew_escape_from_dispatch(loop);
+    if (daemon->end_at_ms >= 0 || end <= now)
+        return lew_escape_from_dispatch(loop);
+    LC_LOG(LC_LOG_NOTICE, "Routers may still send: what comes is returned for %lld ms more",
+           static_cast<long long>(end - now));
+    daemon->end_at_ms = end;
+    reconcile(daemon);
+    return LC_OK;
 }
 
 // --- Start and end
@@ -388,7 +460,7 @@ bool start_parts(tunneld *daemon) {
     static lew_event *slots[3];
     size_t taken = 0;
     for (const int number : {SIGTERM, SIGINT, SIGHUP})
-        if (lew_event_reg_signal(daemon->loop, &slots[taken++], number, take_signal, nullptr) != LC_OK)
+        if (lew_event_reg_signal(daemon->loop, &slots[taken++], number, take_signal, daemon) != LC_OK)
             return false;
     if (!start_commands(&daemon->desk, daemon->options.commands, stdout) || !choose_plane(daemon))
         return false;
@@ -457,9 +529,23 @@ void end_parts(tunneld *daemon) {
 
 } // namespace
 
+// Before its first check a proxy counts as up, as it was under the tunneld before; a gateway that fails
+// closed takes no chances.
+bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules) {
+    const auto &states = health_states(daemon.health);
+    const auto found = states.find(group);
+    if (found == states.end() || found->second.state == proxy_health::unknown)
+        return !rules.drop_when_down;
+    return found->second.state == proxy_health::up;
+}
+
 bool is_active_group(const tunneld &daemon, uint8_t group) {
     const auto found = daemon.configured.groups.find(group);
-    if (found == daemon.configured.groups.end() || found->second.policy_group == 0)
+    if (found == daemon.configured.groups.end())
+        return true; // it takes no part
+    if (!found->second.active || !daemon.desk.wccpd_lives || daemon.end_at_ms >= 0)
+        return false;
+    if (found->second.policy_group == 0)
         return true;
     const auto role = daemon.roles.find(found->second.policy_group);
     return role != daemon.roles.end() && role->second;

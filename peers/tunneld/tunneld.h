@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "peers/tunneld/commands.h"
+#include "peers/tunneld/course.h"
 #include "peers/tunneld/health.h"
 #include "peers/tunneld/plane.h"
 #include "peers/tunneld/session.h"
@@ -24,6 +25,9 @@ constexpr int64_t TAKE_OVER_WAIT_MS = 10000;
 // Between looks whether somebody else has changed what is ours in the kernel.
 constexpr int64_t VERIFY_MS = 30000;
 
+// After wccpd has deleted a tunnel, or has ended: routers need a moment to follow.
+constexpr int64_t LINGER_MS = 5000;
+
 struct tunneld_options {
     command_options commands;
     std::string plane = "auto"; // or the name of one
@@ -33,6 +37,21 @@ struct tunneld_options {
 struct outage {
     int64_t since_ms; // monotonic
     bool left;        // the group has left its routers because of it
+};
+
+struct lingering_link {
+    lingering_tunnel tunnel;
+    int64_t until_ms;
+};
+// A group that is not followed by its configuration alone.
+struct followed_group {
+    course memory;
+    course_decision decided;
+    uint32_t flows = 0;
+    // Of what mgmtd has heard in this session.
+    uint32_t reported_percent = 0; // 0: nothing; a tunneld before may have reported another
+    bool reported_overload = false;
+    std::optional<std::pair<uint32_t, bool>> reported_progress; // flows left, and whether it is empty
 };
 
 struct tunneld {
@@ -57,6 +76,14 @@ struct tunneld {
     std::map<uint8_t, outage> outages;
     std::vector<uint32_t> own_addresses;
     owners_table owners;
+    std::map<uint8_t, followed_group> followed;
+    uint32_t reported_session = 0; // that `followed` speaks of
+    std::string uncounted;         // why flows could not be counted, or ""
+
+    int32_t roles_of_pid = 0;              // the wccpd whose roles of groups are known
+    int64_t active_ms = -1;                // when a group was ACTIVE last
+    std::vector<lingering_link> lingering; // of tunnels that have been deleted
+    int64_t end_at_ms = -1;                // the program has been told to end, and waits until then
 
     std::vector<wanted_link> links; // that are there, or were wanted last
     std::optional<wanted_state> applied;
@@ -65,8 +92,12 @@ struct tunneld {
     int64_t again_at_ms = 0, retry_delay_ms = 0;
 };
 
-// Whether no role keeps new flows of the group from its proxy.
+// Slow starts, drains and limits of all groups: to call once a second.
+void follow_groups(tunneld *daemon);
+// Whether new flows of the group may go to its proxy: wccpd runs, a router assigns to this appliance, and no
+// role of a policy group is against it.
 bool is_active_group(const tunneld &daemon, uint8_t group);
+bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules);
 // The program, until a signal ends it. The exit code.
 int run_tunneld(const tunneld_options &options);
 // The state nodes, in the order of a walk.

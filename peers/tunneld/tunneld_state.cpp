@@ -3,6 +3,7 @@
 
 #include "mgmt/bnode_types.h"
 #include "mgmt/node_paths.h"
+#include "peers/tunneld/flow_count.h"
 #include "peers/tunneld/link_names.h"
 #include "peers/tunneld/tunneld.h"
 #include "runtime/ttime.h"
@@ -34,7 +35,9 @@ void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorti
                  std::vector<state_node> *out) {
     for (const wanted_link &link : daemon.links) {
         const auto index = daemon.indices.find(link.name);
-        if (link.wish.accepted || index == daemon.indices.end())
+        const auto ordered = daemon.desk.tunnels.find(link.wish.tunnel_id);
+        if (link.wish.accepted || index == daemon.indices.end() || ordered == daemon.desk.tunnels.end() ||
+            ordered->second.local != link.wish.local || ordered->second.remote != link.wish.remote)
             continue;
         const std::string id = std::to_string(link.wish.tunnel_id);
         node_writer writer = {out, std::string(NODE_TUNNEL_STATE) + "/" + id};
@@ -81,6 +84,10 @@ void add_intercepts(const tunneld &daemon, const sorting_counters &sorting, std:
     static const char *const words[] = {"unknown", "up", "down"};
     const auto &states = health_states(daemon.health);
     const int64_t now = lt_monotonic_ms();
+    std::vector<flow_ends> flows;
+    std::string error;
+    const bool counted = read_transparent_flows(daemon.own_addresses, &flows, &error);
+    const auto counts = count_flows(flows, daemon.configured.intercepts);
     for (const auto &[group, rules] : daemon.configured.intercepts) {
         const std::string number = std::to_string(group);
         node_writer writer = {out, std::string(NODE_INTERCEPT_STATE) + "/" + number};
@@ -94,9 +101,16 @@ void add_intercepts(const tunneld &daemon, const sorting_counters &sorting, std:
         const auto outage = daemon.outages.find(group);
         writer.add("left", bn_type_bool,
                    outage != daemon.outages.end() && outage->second.left ? "true" : "false");
+        if (const auto count = counts.find(group); counted && count != counts.end())
+            writer.count("flows", count->second);
+        const auto followed = daemon.followed.find(group);
+        const course_decision decided =
+            followed == daemon.followed.end() ? course_decision{} : followed->second.decided;
+        writer.add("overloaded", bn_type_bool, decided.overloaded ? "true" : "false");
+        writer.add("weight_percent", bn_type_uint32, std::to_string(decided.weight_percent));
         static const packet_count none[SORTED_WAYS] = {};
-        const auto counted = sorting.groups.find(group);
-        add_sorted(&writer, counted == sorting.groups.end() ? none : counted->second);
+        const auto ways = sorting.groups.find(group);
+        add_sorted(&writer, ways == sorting.groups.end() ? none : ways->second);
     }
 }
 

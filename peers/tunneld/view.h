@@ -42,11 +42,15 @@ struct intercept {
     bool drop_when_down = false; // fail closed; otherwise flows are returned while the proxy is down
     health_check check;
     uint32_t leave_after_s = 30; // the proxy's being down, until the group leaves its routers; 0: never
+    uint32_t limit = 0;          // flows, above which new ones are returned; 0: none
+    uint32_t slow_start_s = 0;   // until the whole weight is announced, once there is a proxy; 0: at once
     bool operator==(const intercept &) const = default;
 };
 struct intercept_condition {
     bool proxy_up = false;
-    bool active = true; // the role of the group's policy group is ACTIVE, or it has none
+    bool active = true;      // a router assigns to this appliance, and the role of the policy group is ACTIVE
+    bool draining = false;   // the group is being emptied, or out of its routers because of it
+    bool overloaded = false; // there are more flows than the limit
     bool operator==(const intercept_condition &) const = default;
 };
 
@@ -64,6 +68,8 @@ struct group_view {
     uint16_t policy_group = 0; // 0 for none
     bool force_l2_return = false;
     std::vector<group_router> routers; // that have answered
+    bool active = false;               // by wccpd's last answer a router assigns to this appliance
+    bool alone = false;                // by the same answer there is no other appliance
     bool operator==(const group_view &) const = default;
 };
 
@@ -93,9 +99,16 @@ struct group_protection {
     std::vector<uint32_t> targets; // by slot: a member, or 0 for nobody
     bool operator==(const group_protection &) const = default;
 };
+// A tunnel that wccpd has deleted. Its router may go on sending for a moment.
+struct lingering_tunnel {
+    uint16_t id;
+    tunnel_ends ends;
+    bool operator==(const lingering_tunnel &) const = default;
+};
 
 struct appliance_view {
     std::map<uint16_t, tunnel_ends> tunnels; // by tunnel id
+    std::vector<lingering_tunnel> lingering; // new flows of these are returned
     std::map<uint8_t, group_view> groups;
     std::map<uint8_t, intercept> intercepts; // by group
     std::map<uint8_t, intercept_condition> conditions;

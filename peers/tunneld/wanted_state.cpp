@@ -43,14 +43,24 @@ bool stands_beside(const accepted_source &source, const tunnel_ends &tunnel) {
     return !source.router || source.router == tunnel.remote;
 }
 
+// Those that are there, and after them those that go.
+std::vector<lingering_tunnel> all_tunnels(const appliance_view &view) {
+    std::vector<lingering_tunnel> out;
+    for (const auto &[id, ends] : view.tunnels)
+        out.push_back({id, ends});
+    out.insert(out.end(), view.lingering.begin(), view.lingering.end());
+    return out;
+}
+
 std::vector<link_wish> wish_links(const appliance_view &view) {
     std::vector<link_wish> wishes;
     std::set<tunnel_ends> taken;
-    for (const auto &[id, ends] : view.tunnels)
+    const auto tunnels = all_tunnels(view);
+    for (const auto &[id, ends] : tunnels)
         if (taken.insert(ends).second)
             wishes.push_back({id, ends.local, ends.remote, false});
     for (const auto &source : view.accepted)
-        for (const auto &[id, ends] : view.tunnels)
+        for (const auto &[id, ends] : tunnels)
             if (source.address && stands_beside(source, ends) &&
                 taken.insert({ends.local, source.address}).second)
                 wishes.push_back({id, ends.local, source.address, true});
@@ -90,9 +100,10 @@ bool carries_group(const tunnel_ends &tunnel, const group_view &group) {
 }
 
 // The ends of a group's links and, for each, the tunnel that they stand beside or are.
-std::map<tunnel_ends, tunnel_ends> group_links(const appliance_view &view, const group_view &group) {
+std::map<tunnel_ends, tunnel_ends> group_links(const appliance_view &view, const group_view &group,
+                                               const std::vector<lingering_tunnel> &tunnels) {
     std::map<tunnel_ends, tunnel_ends> links;
-    for (const auto &[id, tunnel] : view.tunnels) {
+    for (const auto &[id, tunnel] : tunnels) {
         if (!carries_group(tunnel, group))
             continue;
         links[tunnel] = tunnel;
@@ -191,7 +202,10 @@ void want_l2_interfaces(const appliance_view &view, const link_numbers &numbers,
 std::vector<std::string> group_interfaces(const appliance_view &view, const group_view &group,
                                           const link_numbers &numbers) {
     std::vector<std::string> names;
-    for (const auto &[ends, tunnel] : group_links(view, group))
+    std::vector<lingering_tunnel> tunnels; // the others belong to no group: what comes there is returned
+    for (const auto &[id, ends] : view.tunnels)
+        tunnels.push_back({id, ends});
+    for (const auto &[ends, tunnel] : group_links(view, group, tunnels))
         names.push_back(link_name(numbers.at(ends)));
     if (redirects_by_l2(group))
         names.push_back(group.interface);
@@ -231,7 +245,7 @@ wanted_state make_wanted_state(const appliance_view &view, const std::vector<wan
     const auto numbers = number_links(wishes, before);
     std::map<tunnel_ends, l2_choice> choices;
     for (const auto &[id, group] : view.groups)
-        for (const auto &[ends, tunnel] : group_links(view, group))
+        for (const auto &[ends, tunnel] : group_links(view, group, all_tunnels(view)))
             choose_return(group, tunnel.remote, &choices[ends]);
     std::map<uint32_t, link_wish> by_number;
     for (const auto &wish : wishes)

@@ -1,0 +1,84 @@
+// What wccpd is given instead of the configured values of a group, for as long as an operational state lasts:
+// "down" for the admin of a group that is out of its routers, a part of the weight for one that is being
+// emptied or that starts slowly. The file and the queries of others have what is configured.
+#include <algorithm>
+
+#include "mgmt/node_paths.h"
+#include "peers/mgmtd/server.h"
+
+static const node_name &configured_groups() {
+    static const node_name root = parsed_name(NODE_GROUP_CONFIG);
+    return root;
+}
+
+group_overlay server_overlay_of(const server *self, uint8_t group) {
+    group_overlay out;
+    out.down = self->left.contains(group);
+    if (const auto slowed = self->slowed.find(group); slowed != self->slowed.end())
+        out.weight_percent = slowed->second.percent;
+    if (const auto drain = self->drains.find(group); drain != self->drains.end()) {
+        out.weight_percent = 0;
+        out.down = out.down || drain->second.left;
+    }
+    return out;
+}
+
+// A part of a weight is at least 1, except when there is none.
+static std::string part_of_weight(const std::string &text, uint32_t percent) {
+    const uint64_t weight = std::stoull(text);
+    if (percent == 0 || weight == 0)
+        return "0";
+    return std::to_string(std::max<uint64_t>(weight * percent / 100, 1));
+}
+
+static node_value laid_over(const group_overlay &overlay, const std::string &leaf, const node_value &value) {
+    if (overlay.down && leaf == "admin")
+        return {value.type, "down"};
+    if (overlay.weight_percent != 100 && leaf == "weight")
+        return {value.type, part_of_weight(value.text, overlay.weight_percent)};
+    return value;
+}
+
+// The overlay that the node lies under. False: it is none of a group's own.
+static bool find_overlay(const server *self, const node_name &name, group_overlay *out) {
+    const size_t depth = configured_groups().parts.size();
+    if (name.parts.size() != depth + 2 || !name.is_under(configured_groups()))
+        return false;
+    *out = server_overlay_of(self, static_cast<uint8_t>(std::stoi(name.parts[depth])));
+    return true;
+}
+
+node_value server_value_for_wccpd(const server *self, const node_name &name, const node_value &value) {
+    group_overlay overlay;
+    return find_overlay(self, name, &overlay) ? laid_over(overlay, name.parts.back(), value) : value;
+}
+
+void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout) {
+    std::erase_if(*inout, [&](node_change &change) {
+        group_overlay overlay;
+        if (!find_overlay(self, change.name, &overlay))
+            return false;
+        for (std::optional<node_value> *value : {&change.before, &change.after})
+            if (*value)
+                **value = laid_over(overlay, change.name.parts.back(), **value);
+        return change.before == change.after;
+    });
+}
+
+// The weight comes first: a group that joins again does so with the weight that it is to have.
+void server_send_overlay(server *self, uint8_t group, const group_overlay &before) {
+    const group_overlay now = server_overlay_of(self, group);
+    std::vector<node_change> changes;
+    for (const char *leaf : {"weight", "admin"}) {
+        const node_name name = configured_groups().below(std::to_string(group)).below(leaf);
+        const auto found = self->tree.nodes.find(name);
+        if (found == self->tree.nodes.end())
+            continue;
+        const node_value was = laid_over(before, leaf, found->second),
+                         is = laid_over(now, leaf, found->second);
+        if (was != is)
+            changes.push_back({name, was, is});
+    }
+    if (!changes.empty())
+        server_send_to_wccpd(self, changes);
+}
