@@ -73,6 +73,29 @@ says() { # APPLIANCE SECONDS LINE (extended regular expression)
 group_is() { # APPLIANCE SECONDS GROUP JQ
     lab_wait "$2" "$4" lab_state "$1" "$3" || die "group $3 of $1"
 }
+# An appliance with a proxy; KEEP as lab_proxy has it.
+proxied() { # NODE ADDRESS KEEP [TEXT]...
+    lab_appliance "$1" "$2"
+    lab_gateway "$1" 10.0.0.1
+    # shellcheck disable=SC2086
+    lab_proxy "$1" 3129 $3
+    lab_appliance_start "$1" "${@:4}"
+}
+# The appliances own all of the group's table, and their proxies are up.
+ready() { # GROUP APPLIANCE...
+    local group=$1 node; shift
+    router_is r1 60 "$group" "([\$g.assignment.buckets[]?, \$g.assignment.masks[]?.values[].owner] | unique | length == $# and all(.[]; .))"
+    for node; do state_is "$node" 20 intercept 'length > 0 and all(.[]; .proxy == "up" and .active)'; done
+}
+# Nodes of tunneld below /qv/tunneld/KIND/state, as nested objects.
+state() { # NODE KIND
+    lab_manage "$1" walk "/qv/tunneld/$2/state" 2>/dev/null | jq -c '
+        (arrays // []) | map(.name) as $names | map(select((.name + "/") as $above | all($names[]; startswith($above) | not))) |
+        reduce .[] as $node ({}; setpath($node.name | split("/")[5:]; $node.value))'
+}
+state_is() { # NODE SECONDS KIND JQ
+    lab_wait "$2" "$4" state "$1" "$3" || die "$3 of $1"
+}
 configure() { # APPLIANCE [TEXT]...
     lab_configure "$@" || die "configuration of $1"
 }

@@ -21,6 +21,7 @@
 #     lab_appliance_start NODE [TEXT]...      with that configuration: any lines of mgmtd's file (docs/mgmtd.md)
 #     lab_configure NODE [TEXT]...            writes it anew, whole, and waits until mgmtd has taken it (1: refused)
 #     lab_mgmtd_start NODE, lab_wccpd_start NODE    one of them again, until it is ready
+#     lab_supervise NODE                      mgmtd that starts tunneld and wccpd, after lab_write_config NODE [TEXT]...
 #     lab_manage NODE WORDS...                mgmtctl --json WORDS inside the appliance
 #     lab_state NODE [GROUP]                  the groups by number, or one of them: the monitoring nodes as one JSON object
 #     lab_events NODE                         the lines of mgmtd since its start: sessions, commits, alarms, roles
@@ -433,6 +434,22 @@ lab_appliance_start() { # NODE [TEXT]...
 lab_tunneld_start() { # NODE OPTIONS...
     # shellcheck disable=SC2086
     lab_start "$1" tunneld tunneld ${LAB_PLANE:+--plane $LAB_PLANE} "${@:2}"
+}
+# mgmtd, whose patience is by the wall's clock, with programs under it that run by the protocol's, in the configuration
+# that lab_write_config has written.
+lab_supervise() { # NODE
+    local program directory=/proc/${LAB_INIT[$1]}/root/run/wccpd options=
+    [ -n "${LAB_FOUND[$1]+known}" ] || LAB_FOUND[$1]=$(lab_remains "$1")
+    lab_clock
+    mkdir -p "$directory"
+    for program in wccpd tunneld; do
+        [ $program = wccpd ] || options=${LAB_PLANE:+--plane $LAB_PLANE}
+        printf '#!/bin/sh\nexec %s %s %s "$@"\n' "${LAB_CLOCK[*]}" "$WCCP_BIN/$program" "$options" >"$directory/$program"
+        chmod +x "$directory/$program"
+    done
+    : >"$LAB/$1-mgmtd.out"
+    lab_start "$1" mgmtd mgmtd --config "$LAB_CONFIG" --supervise --wccpd /run/wccpd/wccpd --tunneld /run/wccpd/tunneld
+    lab_wait_event 20 "$1" '^mgmtd ready' || lab_show_and_die "$1" "mgmtd of $1 does not start"
 }
 lab_mgmtd_start() { # NODE
     : >"$LAB/$1-mgmtd.out"

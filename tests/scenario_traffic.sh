@@ -16,29 +16,6 @@ start() { # OPTIONS OF wccp_router...
     lab_client c1 r1
     lab_server s1 r1
 }
-# An appliance with a proxy; KEEP as lab_proxy has it.
-proxied() { # NODE ADDRESS KEEP [TEXT]...
-    lab_appliance "$1" "$2"
-    lab_gateway "$1" 10.0.0.1
-    # shellcheck disable=SC2086
-    lab_proxy "$1" 3129 $3
-    lab_appliance_start "$1" "${@:4}"
-}
-# The appliances own all of the group's table, and their proxies are up.
-ready() { # GROUP APPLIANCE...
-    local group=$1 node; shift
-    router_is r1 60 "$group" "([\$g.assignment.buckets[]?, \$g.assignment.masks[]?.values[].owner] | unique | length == $# and all(.[]; .))"
-    for node; do state_is "$node" 20 intercept '.["51"] | .proxy == "up" and .active'; done
-}
-# Nodes of tunneld below /qv/tunneld/KIND/state, as nested objects.
-state() { # NODE KIND
-    lab_manage "$1" walk "/qv/tunneld/$2/state" 2>/dev/null | jq -c '
-        (arrays // []) | map(.name) as $names | map(select((.name + "/") as $above | all($names[]; startswith($above) | not))) |
-        reduce .[] as $node ({}; setpath($node.name | split("/")[5:]; $node.value))'
-}
-state_is() { # NODE SECONDS KIND JQ
-    lab_wait "$2" "$4" state "$1" "$3" || die "$3 of $1"
-}
 explained() { # NODE LINE
     lab_in "$1" "$WCCP_BIN/mgmtctl" tunnel show >"$LAB/explained"
     grep -q "$2" "$LAB/explained" || die "not explained: $(cat "$LAB/explained")"
@@ -239,8 +216,8 @@ case_kills() {
     lab_gateway a1 10.0.0.1
     lab_proxy a1
     lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
-    LAB_FOUND[a1]=$(lab_remains a1)
-    supervised
+    lab_supervise a1
+    role a1 60 51 ACTIVE
     ready 51 a1
     local wccpd i transfers results=$LAB/transfers
     wccpd=$(lab_in a1 pgrep -x wccpd)
@@ -263,25 +240,13 @@ case_kills() {
     # All of them at once, with their rules: the next ones take them over.
     lab_in a1 pkill -KILL -x 'mgmtd|tunneld|wccpd'
     lab_wait_exit 5 a1 mgmtd
-    supervised
+    lab_supervise a1
+    role a1 60 51 ACTIVE
     ready 51 a1
     fetches "$(by a1)" --count 4
     lab_stop a1 mgmtd || die "mgmtd ended with $?"
     LAB_KILLED[a1]+='|uds-client-(wccpd|tunneld)-[0-9]+$'
     finish a1
-}
-# mgmtd, whose patience is by the wall's clock, with programs that run by the protocol's.
-supervised() {
-    local program directory=/proc/${LAB_INIT[a1]}/root/run/wccpd
-    lab_clock
-    mkdir -p "$directory"
-    for program in wccpd tunneld; do
-        printf '#!/bin/sh\nexec %s %s "$@"\n' "${LAB_CLOCK[*]}" "$WCCP_BIN/$program" >"$directory/$program"
-        chmod +x "$directory/$program"
-    done
-    : >"$LAB/a1-mgmtd.out"
-    lab_start a1 mgmtd mgmtd --config "$LAB_CONFIG" --supervise --wccpd /run/wccpd/wccpd --tunneld /run/wccpd/tunneld
-    role a1 60 51 ACTIVE
 }
 
 lab_case

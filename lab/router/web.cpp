@@ -4,11 +4,13 @@
 #include <netinet/in.h>
 #include <netinet/tcp.h>
 #include <sys/socket.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <cmath>
 #include <csignal>
 #include <cstdio>
 #include <cstring>
@@ -199,6 +201,7 @@ int run_web(const web_options &options) {
 struct fetched {
     const char *wrong = nullptr; // or why it has failed
     std::string proxy, peer;
+    bool last = false; // the server closes the connection after this answer
     double took = 0;
 };
 static const char *connect_from(int fd, const fetch_options &options, uint32_t source) {
@@ -219,29 +222,28 @@ static void pause_for(double seconds) {
     if (seconds > 0)
         usleep(static_cast<useconds_t>(seconds * 1e6));
 }
-static const char *talk(int fd, const fetch_options &options, fetched *out) {
-    stream in = {fd, "", "send"};
+static std::string request_of(const fetch_options &options) {
     const bool post = options.upload > 0;
-    const std::string request = std::string(post ? "POST /upload" : "GET /" + std::to_string(options.size)) +
-                                " HTTP/1.1\r\nHost: " + options.server + "\r\n" +
-                                (post ? "Content-Length: " + std::to_string(options.upload) + "\r\n" : "") +
-                                "\r\n";
-    for (uint32_t i = 0; i < options.requests; i++) {
-        if (i > 0)
-            pause_for(options.pause);
-        std::string head;
-        if (!send_all(fd, request.data(), request.size()) || !send_body(fd, options.upload) ||
-            !read_head(&in, &head))
-            return in.wrong;
-        if (!head.starts_with("HTTP/1.1 200"))
-            return "status";
-        if (!post && number_in(header_of(head, "Content-Length")) != options.size)
-            return "length";
-        if (!read_body(&in, number_in(header_of(head, "Content-Length"))))
-            return in.wrong;
-        out->proxy = header_of(head, "X-Proxy");
-        out->peer = header_of(head, "X-Peer");
-    }
+    return std::string(post ? "POST /upload" : "GET /" + std::to_string(options.size)) +
+           " HTTP/1.1\r\nHost: " + options.server + "\r\n" +
+           (post ? "Content-Length: " + std::to_string(options.upload) + "\r\n" : "") + "\r\n";
+}
+// One request and its answer.
+static const char *talk(stream *in, const std::string &request, const fetch_options &options, fetched *out) {
+    std::string head;
+    in->wrong = "send";
+    if (!send_all(in->fd, request.data(), request.size()) || !send_body(in->fd, options.upload) ||
+        !read_head(in, &head))
+        return in->wrong;
+    if (!head.starts_with("HTTP/1.1 200"))
+        return "status";
+    if (options.upload == 0 && number_in(header_of(head, "Content-Length")) != options.size)
+        return "length";
+    if (!read_body(in, number_in(header_of(head, "Content-Length"))))
+        return in->wrong;
+    out->proxy = header_of(head, "X-Proxy");
+    out->peer = header_of(head, "X-Peer");
+    out->last = strcasecmp(header_of(head, "Connection").c_str(), "close") == 0;
     return nullptr;
 }
 static fetched fetch_once(const fetch_options &options, uint32_t source) {
@@ -250,8 +252,13 @@ static fetched fetch_once(const fetch_options &options, uint32_t source) {
     const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     set_limits(fd, options.timeout);
     one.wrong = connect_from(fd, options, source);
-    if (!one.wrong)
-        one.wrong = talk(fd, options, &one);
+    stream in = {fd, "", ""};
+    const std::string request = request_of(options);
+    for (uint32_t i = 0; i < options.requests && !one.wrong; i++) {
+        if (i > 0)
+            pause_for(options.pause);
+        one.wrong = talk(&in, request, options, &one);
+    }
     close(fd);
     one.took = wall_seconds() - began;
     return one;
@@ -289,6 +296,135 @@ static void fetch_many(const fetch_options &options, double began, tally *all) {
     }
 }
 
+// ---- long connections
+
+struct crowd {
+    const fetch_options &options;
+    const std::string request;
+    double until = 0;               // wall_seconds(); 0: until it is told to end
+    std::atomic<bool> over = false; // every connection ends after its next answer
+    std::atomic<bool> aging = false;
+    std::mutex lock = {}; // for what follows, and for standard output
+    uint64_t opened = 0, ended = 0, broken = 0, unopened = 0, answers = 0;
+    double slowest = 0;
+    std::map<std::string, uint64_t> broken_by = {}, failures = {};
+};
+struct long_connection {
+    uint32_t number;
+    stream in;
+    uint64_t answers = 0;
+    std::string proxy;
+};
+
+static bool is_over(const crowd &all) {
+    return all.over || (all.until > 0 && wall_seconds() >= all.until);
+}
+// `asked` is the time of the request after which it happened, in seconds since 1970.
+static void print_event(const char *what, const long_connection &one, double asked, const char *why) {
+    nlohmann::ordered_json event = {{"asked", asked},
+                                    {"what", what},
+                                    {"connection", one.number},
+                                    {"proxy", one.proxy},
+                                    {"answers", one.answers}};
+    if (why)
+        event["why"] = why;
+    puts(event.dump().c_str());
+    fflush(stdout);
+}
+static double seconds_since_1970() {
+    timespec now = {};
+    clock_gettime(CLOCK_REALTIME, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+}
+
+// False when the connection has ended, by whatever.
+static bool ask_again(crowd *all, long_connection *one, uint64_t last_answer) {
+    fetched answer;
+    const double asked = seconds_since_1970(), began = wall_seconds();
+    const char *wrong = talk(&one->in, all->request, all->options, &answer);
+    const std::lock_guard guard(all->lock);
+    if (wrong) {
+        all->broken++;
+        all->broken_by[one->proxy]++;
+        all->failures[wrong]++;
+        print_event("broken", *one, asked, wrong);
+        return false;
+    }
+    all->answers++;
+    all->slowest = std::max(all->slowest, wall_seconds() - began);
+    one->proxy = answer.proxy;
+    if (one->answers++ == 0)
+        print_event("opened", *one, asked, nullptr);
+    if (!answer.last && one->answers < last_answer)
+        return true;
+    all->ended++;
+    print_event("ended", *one, asked, nullptr);
+    return false;
+}
+// From its opening to its end. The requests of all connections are spread over each second.
+static void live_connection(crowd *all, long_connection *one) {
+    const double phase = static_cast<double>(one->number) / all->options.long_lived;
+    uint64_t last_answer = all->aging ? all->options.life : UINT64_MAX;
+    while (!is_over(*all)) {
+        if (all->aging && last_answer == UINT64_MAX)
+            last_answer = one->answers + 1 + one->number % all->options.life;
+        if (!ask_again(all, one, last_answer))
+            return;
+        const double now = wall_seconds();
+        usleep(static_cast<useconds_t>((std::floor(now - phase) + 1 + phase - now) * 1e6));
+    }
+}
+static void keep_connected(crowd *all, uint32_t number) {
+    const fetch_options &options = all->options;
+    usleep(number * 1'000'000U / options.long_lived);
+    while (!is_over(*all)) {
+        long_connection one = {number, {socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0), "", ""}, 0, ""};
+        set_limits(one.in.fd, options.timeout);
+        const char *wrong = connect_from(one.in.fd, options, number % options.sources);
+        {
+            const std::lock_guard guard(all->lock);
+            (wrong ? all->unopened : all->opened)++;
+            if (wrong)
+                print_event("unopened", one, seconds_since_1970(), wrong);
+        }
+        if (!wrong)
+            live_connection(all, &one);
+        close(one.in.fd);
+        usleep(200'000);
+    }
+}
+
+static int keep_all_connected(const fetch_options &options) {
+    crowd all = {options, request_of(options)};
+    if (options.seconds > 0)
+        all.until = wall_seconds() + options.seconds;
+    sigset_t signals;
+    sigemptyset(&signals);
+    for (const int number : {SIGTERM, SIGINT, SIGUSR1})
+        sigaddset(&signals, number);
+    pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+    std::vector<std::thread> workers;
+    for (uint32_t number = 0; number < options.long_lived; number++)
+        workers.emplace_back(keep_connected, &all, number);
+    while (!is_over(all)) {
+        const timespec wait = {0, 100'000'000};
+        const int number = sigtimedwait(&signals, nullptr, &wait);
+        if (number == SIGUSR1)
+            all.aging = true;
+        else if (number > 0)
+            all.over = true;
+    }
+    for (std::thread &one : workers)
+        one.join();
+    const nlohmann::ordered_json result = {{"what", "result"},         {"connections", options.long_lived},
+                                           {"opened", all.opened},     {"ended", all.ended},
+                                           {"broken", all.broken},     {"broken_by", all.broken_by},
+                                           {"failures", all.failures}, {"unopened", all.unopened},
+                                           {"answers", all.answers},   {"slowest", all.slowest}};
+    puts(result.dump().c_str());
+    return all.broken == 0 && all.answers > 0 ? 0 : 1;
+}
+
 void add_fetch_options(CLI::App *app, fetch_options *options) {
     app->add_option("SERVER", options->server)->required()->check(CLI::ValidIPV4);
     app->add_option("--port", options->port);
@@ -303,9 +439,16 @@ void add_fetch_options(CLI::App *app, fetch_options *options) {
     app->add_option("--timeout", options->timeout, "seconds of silence that a fetch survives");
     app->add_option("--seconds", options->seconds, "go on for so long, whatever --count says");
     app->add_option("--pause", options->pause, "seconds after each request");
+    app->add_option("--long", options->long_lived,
+                    "so many connections that last, with a request per second on each")
+        ->check(CLI::Range(1, 4096));
+    app->add_option("--life", options->life, "requests on each of them after SIGUSR1")
+        ->check(CLI::PositiveNumber);
 }
 
 int run_fetch(const fetch_options &options) {
+    if (options.long_lived > 0)
+        return keep_all_connected(options);
     tally all;
     const double began = all.last_good = wall_seconds();
     std::vector<std::thread> workers;

@@ -24,7 +24,6 @@ enum sorted_as : uint8_t {
     SORTED_DROPPED,
     SORTED_OWN,      // the appliance's own traffic, redirected to itself
     SORTED_PASSED,   // of a flow that another appliance has
-    SORTED_OWN,      // the appliance's own traffic, redirected to itself
     SORTED_OVERLOAD, // wanted, but the proxy has as many flows as it may have: returned
     SORTED_WAYS
 };

@@ -1,0 +1,172 @@
+#!/bin/bash
+# Long connections through two appliances, a request per second on each. Appliances join, change their weights, are
+# killed and replaced in part, and leave: no connection breaks but those of a proxy that is killed itself.
+#   scenario_flows.sh DIRECTORY_OF_THE_PROGRAMS [CASE...]
+#   scenario_flows.sh DIRECTORY_OF_THE_PROGRAMS --one CASE     prints a table of what broke at which event
+#   LAB_FLOWS     how many connections (default 200)
+#   LAB_PROTECTION   protection time in seconds; 0: none. The case then only prints what broke
+#   LAB_EVENTS    which events, in this order (default: those of the case)
+set -u
+: "${LAB_SPEED:=4}" "${LAB_FLOWS:=200}"
+export LAB_SPEED LAB_FLOWS
+# shellcheck source=../lab/cases.sh
+source "$(dirname "${BASH_SOURCE[0]}")/../lab/cases.sh"
+lab_cases "$@"
+
+flows=$LAB/flows.out # events of the client, and `"what":"begins"` of ours
+group='' section='' intercept='' last_answers=8
+
+# ---- the network: a1 and a2 share the group, a3 is there without its programs
+
+begin() { # METHOD [NAME=VALUE]... : of the group
+    local node n
+    lab_router r1 10.0.0.1 -- --redirect c1=51 --forward "$1" --return "$1"
+    lab_client c1 r1
+    lab_server s1 r1
+    group=${*:2}
+    [ -z "${LAB_PROTECTION-}" ] || section=$(printf '[/qv/tunneld/protection/config]\ntime = %s\n' "$LAB_PROTECTION")
+    intercept=$(lab_intercept 51 ports=80 interval=1 rise=1)
+    for n in 1 2 3; do
+        lab_appliance a$n 10.0.0.10$n
+        lab_gateway a$n 10.0.0.1
+        lab_proxy a$n
+    done
+    run_appliance a1
+    run_appliance a2
+    ready 51 a1 a2
+    nsenter -t "${LAB_INIT[c1]}" --net "$WCCP_BIN/wccp_router" fetch --from 10.1.0.128 --sources 112 10.2.0.2 \
+        --long "$LAB_FLOWS" --life $last_answers --timeout 10 >"$flows" &
+    LAB_PID[c1/client]=$! client=$!
+    lab_wait 20 ". == $LAB_FLOWS" eval 'grep -c opened "$flows"' || die "connections"
+    jq -es 'map(.proxy) | unique == ["a1", "a2"]' "$flows" >/dev/null || die "not through the two proxies"
+}
+configuration() { # NODE [NAME=VALUE]...
+    # shellcheck disable=SC2086
+    printf '%s\n' "$(lab_group 51 10.0.0.1 $group "${@:2}")" "$intercept" "$section"
+}
+run_appliance() { # NODE
+    lab_write_config "$1" "$(configuration "$1" weight=100)"
+    lab_supervise "$1"
+}
+
+# ---- events; each leaves behind what the next one finds
+
+# How much of the table an appliance has, as a JQ expression over the group: of 1.
+share_of() { # ADDRESS
+    echo "([\$g.assignment.buckets[]?, \$g.assignment.masks[]?.values[].owner] | (map(select(. == \"$1\")) | length) / length)"
+}
+event_join() {
+    run_appliance a3
+    ready 51 a1 a2 a3
+}
+event_weight() {
+    configure a2 "$(configuration a2 weight=400)"
+    router_is r1 30 51 "$(share_of 10.0.0.102) > 0.6"
+}
+event_tunneld_killed() {
+    kill_one a1 tunneld
+    state_is a1 20 intercept '.["51"].active'
+}
+# The designated appliance: its successor makes the table anew.
+event_wccpd_killed() {
+    local before
+    before=$(lab_ctl r1 show | jq -c '.groups["51"].assignment | [.buckets, .masks]')
+    kill_one a1 wccpd
+    lab_wait_event 60 a1 '^role of group 51: ACTIVE' || die "a1 does not come back"
+    ready 51 a1 a2 a3
+    [ "$(lab_ctl r1 show | jq -c '.groups["51"].assignment | [.buckets, .masks]')" = "$before" ] ||
+        echo "note: the table is not the same after wccpd of a1 was killed"
+}
+kill_one() { # NODE NAME : its supervisor starts it again
+    LAB_KILLED[$1]+="|uds-client-$2-[0-9]+\$"
+    : >"$LAB/$1-mgmtd.out"
+    lab_in "$1" pkill -KILL -x "$2" || die "no $2 to kill"
+    lab_wait_event 20 "$1" "^process $2: started" || die "$2 of $1"
+}
+event_proxy_killed() {
+    lab_stop a2 proxy KILL 2>/dev/null
+    state_is a2 10 intercept '.["51"].proxy == "down"'
+    lab_proxy a2
+    state_is a2 10 intercept '.["51"].proxy == "up"'
+}
+event_drain_stop() {
+    kill -USR1 $client # connections end one after the other, and the new ones do not last
+        lab_in a3 "$WCCP_BIN/mgmtctl" drain 51 for 120 wait || die "the drain ended with $?"
+    lab_stop a3 mgmtd || die "mgmtd of a3 ended with $?"
+    router_is r1 30 51 '$g.appliances | length == 2'
+}
+
+# ---- what came of it
+
+# What breaks by what was asked from now on is this event's.
+note_begin() { # EVENT
+    jq -nc --arg event "$1" --arg now "$EPOCHREALTIME" \
+        '{asked: ($now | tonumber), what: "begins", event: $event}' >>"$LAB/events"
+}
+# One JSON object for each event: connections that were open when it began, by proxies, and those that broke.
+summary() {
+    jq -cs --slurpfile events "$LAB/events" '
+        map(select(.what != "result")) as $all | $events | to_entries[] |
+        .value.asked as $from | ($events[.key + 1].asked // 1e12) as $to |
+        {event: .value.event,
+         open: ($all | map(select(.asked < $from)) | reduce .[] as $one ({}; .[$one.connection | tostring] = $one) |
+            map(select(.what == "opened").proxy) | group_by(.) | map({key: .[0], value: length}) | from_entries)} +
+        ($all | map(select(.asked >= $from and .asked < $to)) |
+            {broken: (map(select(.what == "broken").proxy) | group_by(.) | map({key: .[0], value: length}) | from_entries),
+             why: (map(select(.what == "broken").why) | group_by(.) | map({key: .[0], value: length}) | from_entries),
+             unopened: (map(select(.what == "unopened")) | length)})' "$flows"
+}
+table() { # FILE
+    printf '%-16s %6s %8s  %s\n' event open broken of
+    jq -r '[.event, (.open | add // 0), (.broken | add // 0), ([.broken, .why, {unopened: .unopened}] | map(tojson) | join(" "))] | @tsv' "$1" |
+        while IFS=$'\t' read -r event open broken of; do printf '%-16s %6d %8d  %s\n' "$event" "$open" "$broken" "$of"; done
+    tail -n 1 "$flows"
+}
+run_events() { # EVENT...
+    local event
+    # shellcheck disable=SC2086
+    [ -z "${LAB_EVENTS-}" ] || set -- $LAB_EVENTS
+    for event; do
+        note_begin "$event"
+        "event_$event"
+        sleep 3
+        lab_alive c1 client || die "the client has ended"
+    done
+    kill -TERM $client
+    wait $client
+    summary >"$LAB/summary"
+    table "$LAB/summary"
+}
+# Nothing but what the killed proxy had.
+nothing_breaks() {
+    [ -n "${LAB_PROTECTION-}" ] || jq -es 'all(.[]; .unopened == 0 and
+        .broken == (if .event == "proxy_killed" then .open | {a2} else {} end))' "$LAB/summary" >/dev/null || die "connections broke"
+}
+
+# ---- cases
+
+all_events='join weight tunneld_killed wccpd_killed proxy_killed drain_stop'
+case_gre_hash() {
+    LAB_PLANE=user
+    begin gre hash_src_port=true
+    # shellcheck disable=SC2086
+    run_events $all_events
+    nothing_breaks
+}
+case_l2_mask() {
+    LAB_PLANE=''
+    begin l2 assign_method=mask mask_src_ip=0x1f mask_dst_ip=0 mask_src_port=0x1
+    # shellcheck disable=SC2086
+    run_events $all_events
+    nothing_breaks
+}
+# That it is the protection which keeps them.
+case_unprotected() {
+    LAB_PROTECTION=0
+    LAB_PLANE=user
+    begin gre hash_src_port=true
+    run_events join
+    jq -es '.[0].broken | add > 20' "$LAB/summary" >/dev/null || die "hardly anything breaks"
+}
+
+lab_case
