@@ -7,6 +7,7 @@
 #include <nlohmann/json.hpp>
 
 #include "mgmt/node_paths.h"
+#include "peers/mgmtctl/config_change.h"
 #include "peers/mgmtctl/nodes.h"
 #include "peers/mgmtctl/render.h"
 #include "peers/mgmtctl/watch.h"
@@ -130,6 +131,110 @@ TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
         ASSERT_EQ(said.notes.size(), one.notes.size()) << one.items[0].binding.name;
         for (size_t i = 0; i < said.notes.size(); i++)
             EXPECT_NE(said.notes[i].find(one.notes[i]), std::string::npos) << said.notes[i];
+    }
+}
+
+// Two configurations: what is shown of their difference, and what is asked for. Applied, nothing differs.
+TEST(Changes, AWholeConfigurationIsItsDifference) {
+    const std::string section = "[" + G51 + "]\n", routers = "router/1/ipaddr = 10.0.0.1\n";
+    const struct {
+        std::string before, after;
+        std::vector<std::string> shown, items; // items: +NAME=VALUE, or -NAME; without the group's root
+        size_t notes;
+    } cases[] = {
+        {section + "weight = 100\n", section, {}, {}, 0},
+        {section, section + "weight = 100\n", {}, {}, 0},
+        {section + "weight = 7\n", section, {"modify /weight = 100 (was 7)"}, {"-/weight"}, 0},
+        {section + "weight = 7\n",
+         section + "weight=100\n",
+         {"modify /weight = 100 (was 7)"},
+         {"+/weight=100"},
+         0},
+        {"", section + "weight = 7\n", {"add     = 51", "add    /weight = 7"}, {"+=51", "+/weight=7"}, 0},
+        {section + "weight = 7\n", "", {"delete  (was 51)", "delete /weight (was 7)"}, {"-"}, 0},
+        {section + routers + "router/2/ipaddr = 10.0.0.2\npassword = a\n",
+         section + routers + "password = b\n",
+         {"modify /password = ******** (was ********)", "delete /router/2 (was 2)",
+          "delete /router/2/ipaddr (was 10.0.0.2)"},
+         {"+/password=b", "-/router/2"},
+         1},
+        // A password that is hidden stays; an object of nodes is the same as a file.
+        {section + "password = a\nweight = 7\n", section + "password = ********\nweight = 7\n", {}, {}, 0},
+        {section + "password = a\nweight = 7\nencap = l2\n",
+         "{\"" + G51 + "/password\": \"********\", \"" + G51 + "/weight\": 8, \"" + G51 +
+             "/hash_dst_ip\": true}",
+         {"modify /encap = either (was l2)", "modify /hash_dst_ip = true (was false)",
+          "modify /weight = 8 (was 7)"},
+         {"-/encap", "+/hash_dst_ip=true", "+/weight=8"},
+         0},
+    };
+    for (const auto &one : cases) {
+        config_text before;
+        node_tree after;
+        std::string errors;
+        ASSERT_TRUE(config_parse(one.before, "F", &before)) << before.errors;
+        ASSERT_TRUE(read_config(one.after, "F", before.tree, false, &after, &errors)) << errors;
+        const std::vector<node_change> changes = config_changes(before.tree, after);
+        const std::vector<ctl_change_item> asked = items_of(changes, after);
+        std::vector<std::string> shown, items;
+        for (const node_change &change : changes)
+            shown.push_back(text_change(change, false).erase(7, G51.size()));
+        for (const ctl_change_item &item : asked)
+            items.push_back(item.change == ctl_change::create
+                                ? "+" + item.binding.name.substr(G51.size()) + "=" + item.binding.value
+                                : "-" + item.binding.name.substr(G51.size()));
+        EXPECT_EQ(shown, one.shown) << one.after;
+        EXPECT_EQ(items, one.items) << one.after;
+        EXPECT_EQ(config_notes(asked, before.tree).notes.size(), one.notes) << one.after;
+
+        std::vector<set_step> steps;
+        node_tree made;
+        for (const ctl_change_item &item : asked)
+            steps.push_back({item.change == ctl_change::create ? set_kind::create : set_kind::remove,
+                             item.binding.name, bn_type_str, item.binding.value});
+        EXPECT_EQ(tree_prepare(before.tree, steps, &made).message, "");
+        EXPECT_EQ(made.nodes, after.nodes) << one.after;
+        // What is exported reads the same, with the passwords and without.
+        for (const bool secrets : {false, true})
+            for (const std::string &text :
+                 {export_text({made, {}, {}, ""}, secrets), export_json(made, secrets).dump()}) {
+                node_tree again;
+                ASSERT_TRUE(read_config(text, "F", made, false, &again, &errors)) << text << errors;
+                EXPECT_EQ(again.set, made.set) << text;
+                EXPECT_EQ(text.find("= b") != std::string::npos || text.find("\"b\"") != std::string::npos,
+                          secrets && one.notes)
+                    << text;
+            }
+    }
+
+    config_text before;
+    node_tree after;
+    std::string errors;
+    ASSERT_TRUE(config_parse(section + routers + "weight = 7\n", "F", &before));
+    ASSERT_TRUE(
+        read_config(section + "router/2/ipaddr = 10.0.0.2\n", "F", before.tree, true, &after, &errors));
+    EXPECT_EQ(items_of(config_changes(before.tree, after), after).size(), 2u) << "the rest stays";
+    const struct {
+        std::string content, error;
+    } refused[] = {
+        {section + "password = ********\n",
+         "F:2: " + G51 + "/password: the password is hidden, and there is none here"},
+        {section + "router/2/ipaddr = 10.0.0.2\n", "F:2: " + G51 + "/router: entries are numbered from 1"},
+        {section + "weight = x\n", "F:2: " + G51 + "/weight: \"x\" is no uint32\n"},
+        {"{", "F: is no JSON object of nodes and their values\n"},
+        {" {\"/a\": 1}", "F: /a: there is no such node in the configuration\n"},
+        {"{\"" + G51 + "/weight\": {\"a\": [[1]]}}",
+         "F: " + G51 + "/weight: the value is neither a text nor"},
+        {"{\"" + G51 + "/weight\": 1.5}", "F: " + G51 + "/weight: \"1.5\" is no uint32\n"},
+        {"{\"" + G51 + "\": 51, \"" + G51 + "\": 51}", "F: " + G51 + ": is given twice\n"},
+        {"{\"" + G51 + "/router/2/ipaddr\": \"10.0.0.2\"}",
+         "F: " + G51 + "/router: entries are numbered from 1"},
+        {std::string(1 << 20, '{'), "F: is no JSON object"},
+        {"{\"" + G51 + "\":" + std::string(1 << 20, '['), "F: is no JSON object"},
+    };
+    for (const auto &one : refused) {
+        EXPECT_FALSE(read_config(one.content, "F", before.tree, false, &after, &errors));
+        EXPECT_TRUE(errors.starts_with(one.error)) << errors;
     }
 }
 

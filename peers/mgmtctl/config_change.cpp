@@ -43,7 +43,9 @@ static bool take_json_node(node_tree *tree, const std::string &text, const ctl_j
         *out_reason = "there is no such node in the configuration";
         return false;
     }
-    const std::string given = value.is_string() ? value.get<std::string>() : value.is_null() ? "" : value.dump();
+    const std::string given = value.is_string() ? value.get<std::string>()
+                              : value.is_null() ? ""
+                                                : value.dump();
     std::string kept;
     if (value.is_structured() || (value.is_null() && !row->instance))
         *out_reason = "the value is neither a text nor a number nor true or false";
@@ -76,8 +78,9 @@ static bool keep_hidden(node_tree *tree, const node_tree &present, std::string *
             continue;
         const auto found = present.set.find(name);
         if (found == present.set.end() || found->second.empty()) {
-            *out_reason = name.text() + ": the password is hidden, and there is none here that it could stand "
-                                        "for; \"mgmtctl export --secrets\" writes it";
+            *out_reason = name.text() +
+                          ": the password is hidden, and there is none here that it could stand "
+                          "for; \"mgmtctl export --secrets\" writes it";
             return false;
         }
         text = found->second;

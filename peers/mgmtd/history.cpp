@@ -40,7 +40,8 @@ static std::string entry_path(const history &self, uint32_t number) {
     return self.directory + "/" + FILE_PREFIX + std::to_string(number);
 }
 
-template <typename Number> static bool read_number(const std::string &text, Number *out) {
+template <typename Number>
+static bool read_number(const std::string &text, Number *out) {
     const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), *out);
     return error == std::errc() && end == text.data() + text.size() && !text.empty();
 }
@@ -49,12 +50,9 @@ template <typename Number> static bool read_number(const std::string &text, Numb
 
 static std::string format_entry(const history_entry &entry, const std::string &text) {
     std::vector<std::pair<const char *, std::string>> lines = {
-        {"commit", std::to_string(entry.number)},
-        {"time", std::to_string(entry.time_s)},
-        {"user", shown_text(entry.user)},
-        {"cause", shown_text(entry.cause)},
-        {"changes", std::to_string(entry.changes)},
-        {"what", shown_text(entry.what)},
+        {"commit", std::to_string(entry.number)},   {"time", std::to_string(entry.time_s)},
+        {"user", shown_text(entry.user)},           {"cause", shown_text(entry.cause)},
+        {"changes", std::to_string(entry.changes)}, {"what", shown_text(entry.what)},
     };
     if (entry.returns_to) {
         lines.emplace_back("returns-to", std::to_string(entry.returns_to));

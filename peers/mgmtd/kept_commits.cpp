@@ -67,7 +67,8 @@ static bool kept_text(const server *self, const node_name &name, bool hide, std:
 }
 
 bool server_config_text(const server *self, const node_name &name, bool hide, node_value *out) {
-    static const node_name present = parsed_name(NODE_CONFIG_TEXT), kept = parsed_name(NODE_COMMITS "/*/text");
+    static const node_name present = parsed_name(NODE_CONFIG_TEXT),
+                           kept = parsed_name(NODE_COMMITS "/*/text");
     *out = {bn_type_str, ""};
     if (matches(kept, name))
         return kept_text(self, name, hide, &out->text);

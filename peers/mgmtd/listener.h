@@ -7,7 +7,7 @@
 
 #include <sys/types.h>
 
-constexpr const char *VIEWERS_GROUP = "wccpd"; // of the users who may look, but not change
+constexpr const char *VIEWERS_GROUP = "wccpd";                 // of the users who may look, but not change
 constexpr const char *MGMTD_LOCK_FILE = "/var/run/mgmtd.lock"; // of root's mgmtd
 
 struct listener {
@@ -18,7 +18,7 @@ struct listener {
     std::string viewers_group = VIEWERS_GROUP;
     gid_t viewers = static_cast<gid_t>(-1); // may connect; -1: there is no such group
     gid_t group = 0;                        // of the socket's file
-    dev_t device = 0; // of the socket's file
+    dev_t device = 0;                       // of the socket's file
     ino_t inode = 0;
     std::string complaint; // the last one, which isn't repeated
 };

@@ -7,8 +7,8 @@
 
 #include "mgmt/node_paths.h"
 #include "mgmt/owners.h"
-#include "peers/nodes/node_tree.h"
 #include "peers/nodes/binding_text.h"
+#include "peers/nodes/node_tree.h"
 
 // An event; the fields are bindings in their order.
 bn_request_msg *make_event(const std::string &name, const std::vector<event_field> &fields);

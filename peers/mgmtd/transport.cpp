@@ -6,9 +6,9 @@
 // doesn't read never stops the others: nothing here blocks.
 //
 // The kernel says who a client is. Root and our own user may do everything, the members of a group may look;
-// nobody else is let in. Clients that crowd the socket leave the daemons their places: the name in the greeting
-// decides, and whoever takes long over the greeting gives way to a new connection. Those who may only look
-// have few places, and the name of a daemon is not for them.
+// nobody else is let in. Clients that crowd the socket leave the daemons their places: the name in the
+// greeting decides, and whoever takes long over the greeting gives way to a new connection. Those who may
+// only look have few places, and the name of a daemon is not for them.
 #include "peers/mgmtd/transport.h"
 
 #include <algorithm>
@@ -327,9 +327,8 @@ static std::string identify(const transport *self, int fd, session *out) {
         return "";
     if (!is_member(fd, who, self->place.viewers))
         return out->owner.user;
-    const auto viewers = std::ranges::count_if(self->sessions, [](const auto &each) {
-        return !each.second.ended && !each.second.owner.may_change;
-    });
+    const auto viewers = std::ranges::count_if(
+        self->sessions, [](const auto &each) { return !each.second.ended && !each.second.owner.may_change; });
     return viewers < static_cast<ptrdiff_t>(VIEWER_SESSIONS_MAX) ? "" : "too many of those who may only look";
 }
 
