@@ -169,7 +169,7 @@ case_many() {
     lab_in a1 bash -c 'nft delete table ip tunneld; ip route flush table all proto 204
         while ip rule del preference 2048; do :; done 2>/dev/null'
     local began=${EPOCHREALTIME/./} took
-    lab_start a1 tunneld tunneld --plane kernel
+    lab_tunneld_start a1
     many_in_kernel 20
     took=$(((${EPOCHREALTIME/./} - began) / 1000))
     figure "32 tunnels and 256 intercepts: in the kernel $took ms after the start of tunneld"
@@ -180,7 +180,7 @@ case_many() {
 many_in_kernel() { # SECONDS
     lab_in a1 timeout "$1" bash -c '
         until [ "$(ip route show table all proto 204 | grep -c wccp)" = 32 ] &&
-            nft list chain ip tunneld group/255 2>/dev/null | grep -q tproxy; do sleep 0.02; done' || die "not in the kernel"
+            nft list chain ip tunneld group/255 2>/dev/null | grep -q tproxy; do sleep 0.1; done' || die "not in the kernel"
 }
 
 # The cases use what those of traffic are made of.
