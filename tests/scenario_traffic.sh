@@ -135,6 +135,71 @@ case_proxy_down() {
     finish a1
 }
 
+# Connections that have begun outlive everything that takes the appliance out of service, and new ones pass it by: a
+# limit, a drain, a wccpd that is killed, and the end. The weight comes back in steps.
+case_leaving() {
+    start --forward gre --return gre
+    local long drain
+    proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 slow_start=12)"
+    ready 51 a1
+    lab_wait_event 20 a1 'announces 100 % of its weight' || die "no end of the slow start"
+    [ "$(lab_events a1 | grep -o 'announces [0-9]*' | tr -dc '0-9\n' | xargs)" = '20 40 60 80 100' ] || die "$(lab_events a1)"
+    begin_long
+    configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 limit=7)"
+    state_is a1 5 intercept '.["51"].overloaded'
+    lab_manage a1 alarms | jq -e 'length == 1 and .[0].name == "overload"' >/dev/null || die "$(lab_manage a1 alarms)"
+    fetches "$direct" --count 4
+    state_is a1 5 intercept '.["51"].overload >= 4'
+    end_long
+    state_is a1 5 intercept '.["51"].overloaded | not'
+    fetches "$(by a1)" --count 4
+    lab_manage a1 alarms | jq -e '. == []' >/dev/null || die "$(lab_manage a1 alarms)"
+
+    begin_long
+    lab_manage a1 drain 51 for 30 wait >"$LAB/drained" &
+    drain=$!
+    router_is r1 10 51 '$g.appliances[0].weight == 0'
+    lab_manage a1 drain show | jq -e '.drains == [{group: 51, state: "draining", flows: 8, until: .drains[0].until}]' >/dev/null || die "$(lab_manage a1 drain show)"
+    fetches "$direct" --count 4
+    end_long
+    wait $drain || die "drained: $(cat "$LAB/drained")"
+    router_is r1 10 51 '$g.appliances == []'
+    fetches "$direct" --count 4
+    [ "$(lab_manage a1 get /qv/wccpd/wccp/srv_grp/config/51/weight | jq -r '[.. | .value? // empty][0]')" = 100 ] || die "the configuration has changed"
+    lab_manage a1 drain cancel >/dev/null || die "not cancelled"
+    ready 51 a1
+    fetches "$(by a1)" --count 4
+
+    begin_long
+    lab_stop a1 wccpd KILL
+    state_is a1 5 intercept '.["51"].active | not'
+    fetches "$direct" --count 4
+    lab_wccpd_start a1
+    ready 51 a1
+    fetches "$(by a1)" --count 4
+    end_long
+    [ "$(lab_in a1 ip -o link show group 2048 | wc -l)" = 1 ] || die "not the same link"
+
+    begin_long
+    lab_stop a1 wccpd || die "wccpd: $?"
+    lab_in a1 ip link show wccp0 >/dev/null || die "nothing lingers"
+    fetches "$direct" --count 4
+    lab_stop a1 tunneld || die "tunneld: $?"
+    ! lab_in a1 ip link show wccp0 >"$LAB/remains" 2>&1 || die "a link remains"
+    wait "$long"
+    finish a1
+}
+# Eight connections with a request every half second, for five seconds; all end well.
+begin_long() {
+    lab_fetch c1 --count 8 --parallel 8 --requests 10 --pause 0.5 >"$LAB/long" &
+    long=$!
+    state_is a1 5 intercept '.["51"].flows == 8'
+}
+end_long() {
+    wait "$long"
+    jq -e '.failed == 0 and .proxies.a1 >= 8' "$LAB/long" >/dev/null || die "long connections: $(cat "$LAB/long")"
+}
+
 # A router that redirects the proxy's own requests as well: they reach the server, and the operator is told. The same
 # when they look like the client's.
 case_own_traffic() {

@@ -14,6 +14,8 @@
 #include "mgmt/bnode_proto.h"
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/transport.h"
+#include "peers/tunneld/course.h"
+#include "peers/tunneld/flow_count.h"
 #include "peers/tunneld/health.h"
 #include "peers/tunneld/session.h"
 #include "peers/tunneld/session_config.h"
@@ -593,4 +595,84 @@ TEST_F(Health, EachKindOfCheckHasItsReasons) {
         };
         EXPECT_TRUE(wait_until(gone)) << pid;
     }
+}
+
+// --- Courses and flows
+
+TEST(Course, WeightsLimitsAndDrainsFollowTheFacts) {
+    course one;
+    int64_t at_s = 0;
+    const auto look = [&](const char *when, course_facts facts) {
+        SCOPED_TRACE(std::string(when) + " at " + std::to_string(at_s));
+        facts.now_ms = at_s++ * 1000;
+        const course_decision decided = follow_course(&one, facts);
+        return std::to_string(decided.weight_percent) + (decided.overloaded ? " overloaded" : "") +
+               (decided.empty ? " empty" : "");
+    };
+    const course_facts idle = {.now_ms = 0, .slow_start_s = 40, .limit = 100};
+    const auto with = [&](auto change) {
+        course_facts facts = idle;
+        facts.active = true;
+        change(&facts);
+        return facts;
+    };
+    const course_facts works = with([](course_facts *) {});
+    const auto has = [&](uint32_t flows) { return with([=](course_facts *f) { f->flows = flows; }); };
+    const auto drains = [&](uint32_t flows, bool active, bool alone) {
+        return with([=](course_facts *f) {
+            f->draining = true;
+            f->flows = flows;
+            f->active = active;
+            f->alone = alone;
+        });
+    };
+    // The first step waits for the routers.
+    EXPECT_EQ(look("before it joins", idle), "20");
+    std::string steps;
+    for (int i = 0; i <= 41; i++)
+        if (const std::string now = look("slow start", works); !steps.ends_with(now + " "))
+            steps += now + " ";
+    EXPECT_EQ(steps, "20 40 60 80 100 ");
+    // A wccpd that is started anew in time is none; a proxy that comes up is.
+    for (int i = 0; i < 29; i++)
+        EXPECT_EQ(look("without wccpd", idle), "100");
+    EXPECT_EQ(look("joined again", works), "100");
+    EXPECT_EQ(look("proxy down", with([](course_facts *f) { f->proxy_up = false; })), "20");
+    EXPECT_EQ(look("without a slow start", with([](course_facts *f) { f->slow_start_s = 0; })), "100");
+    EXPECT_EQ(look("and with it again", works), "100");
+    // Above the limit, until below nine tenths of it.
+    EXPECT_EQ(look("limit", has(100)), "100");
+    EXPECT_EQ(look("limit", has(101)), "100 overloaded");
+    EXPECT_EQ(look("limit", has(90)), "100 overloaded");
+    EXPECT_EQ(look("limit", has(89)), "100");
+    // Empty: twice none, after the table has moved; that takes a while where it can't be seen.
+    EXPECT_EQ(look("drain", drains(1, false, false)), "20");
+    EXPECT_EQ(look("drain", drains(0, false, false)), "20");
+    EXPECT_EQ(look("drain", drains(0, false, false)), "20 empty");
+    EXPECT_EQ(look("drain", drains(1, false, false)), "20");
+    (void)look("cancelled", works);
+    EXPECT_EQ(look("alone", drains(0, true, true)), "20");
+    EXPECT_EQ(look("alone", drains(0, true, true)), "20 empty");
+    (void)look("cancelled", works);
+    for (int i = 0; i <= 20; i++)
+        EXPECT_EQ(look("still has buckets", drains(0, true, false)), "20");
+    EXPECT_EQ(look("long enough", drains(0, true, false)), "20 empty");
+    // A group that is found at work is not slowed down.
+    one = {};
+    EXPECT_EQ(look("taken over", works), "100");
+}
+
+TEST(Flows, AreCountedOnceForEachGroup) {
+    // Of a proxy that keeps the client's address both ends of a flow are transparent.
+    const std::vector<flow_ends> made = {
+        {0x0a020002, 0x0a010080, 80, 40000}, {0x0a020002, 0x0a010080, 80, 40001},
+        {0x0a010080, 0x0a020002, 50000, 80}, {0x0a020002, 0x0a010081, 8080, 40000},
+        {0x0a010082, 0x0a020002, 50000, 80},
+    };
+    std::map<uint8_t, intercept> intercepts;
+    intercepts[1].ports = {{80, 80}, {8000, 9000}};
+    intercepts[2].ports = {{80, 80}};
+    intercepts[3].ports = {};
+    intercepts[4].protocol = 17;
+    EXPECT_EQ(count_flows(made, intercepts), (std::map<uint8_t, uint32_t>{{1, 3}, {2, 2}, {3, 4}}));
 }
