@@ -255,4 +255,31 @@ case_full() {
         kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" || die "a full disk is not survived"
 }
 
+# One change over three sites: it halts at the second, which refuses it, and at the first when that is not well.
+case_fleet() {
+    local site file=$LAB/change.conf
+    for site in 1 2 3; do
+        lab_appliance a$site 10.0.0.10$site
+        lab_write_config a$site "$(lab_group 51 10.0.0.1)"
+        lab_mgmtd_start a$site
+    done
+    # shellcheck disable=SC2016
+    { declare -p LAB_INIT; echo 'exec nsenter -t "${LAB_INIT[$1]}" --net --mount --root --ipc --pid --wdns=/ "$WCCP_BIN/${@:2}"'; } >"$LAB/at"
+    fleet() { # STATUS SAID WORDS...
+        local status=$1 said=$2 got; shift 2
+        got=$(FLEET_RUN="bash $LAB/at" FLEET_WAIT=1 "$LAB_TOP/packaging/examples/fleet-apply" "$@" 2>&1 | grep -v ^mgmtctl; exit "${PIPESTATUS[0]}")
+        [ $? = "$status" ] && [ "$got" = "$said" ] || die "fleet-apply $*: $got"
+    }
+    lab_group 51 10.0.0.1 10.0.0.102 weight=7 >"$file"
+    fleet 1 $'a1: changed\na2: refuses the change; halted, not yet reached: a3' --merge "$file" a1 a2 a3
+    [ "$(lab_manage a1 history | jq -c '.[0] | [.cause, .confirm_by]')" = '["apply",null]' ] || die "a1 is not confirmed"
+    [ "$(lab_manage a3 history | jq length)" = 1 ] || die "a3 is changed"
+    lab_group 51 10.0.0.1 weight=7 >"$file"
+    FLEET_HEALTH=false fleet 1 $'a2: is not well, and undoes the change in 5 minutes; halted, not yet reached: a3' --merge "$file" a2 a3
+    lab_in a2 "$WCCP_BIN/mgmtctl" confirm >/dev/null || die "a2 does not wait"
+    fleet 1 "a3: modify /qv/wccpd/wccp/srv_grp/config/51/weight = 7 (was 100)" --check --merge "$file" a2 a3
+    fleet 0 $'a2: unchanged\na3: changed' --merge "$file" a2 a3
+    fleet 0 $'a2: nothing to change\na3: nothing to change' --check --merge "$file" a2 a3
+}
+
 lab_case

@@ -12,7 +12,8 @@ lab_enter "$0" "$@"
 G=/qv/wccpd/wccp/srv_grp/config/51
 S=/qv/wccpd/wccp/srv_grp/state/51
 fail() { echo "$*" >&2; cat "$LAB"/said "$LAB"/complained >&2; lab_show a1 2>/dev/null; exit 1; }
-ctl() { lab_in a1 "$WCCP_BIN/mgmtctl" "$@"; }
+as=() # whom
+ctl() { lab_in a1 "${as[@]}" "$WCCP_BIN/mgmtctl" "$@"; }
 # The exit code, then what standard output has to match whole (a bash pattern, or after "jq:" an expression).
 expect() { # STATUS OUTPUT WORDS...
     local status=$1 wanted=$2 got; shift 2
@@ -51,6 +52,7 @@ lab_in a1 test ! -e /tmp/gcl-socks || fail "a question leaves something behind"
 
 # --- A group that runs, and a watch from its start on
 
+lab_in a1 bash -c 'cp /etc/group /tmp/group; echo wccpd:x:2999: >>/tmp/group; mount --bind /tmp/group /etc/group'
 lab_appliance_start a1 "$(lab_group 51 10.0.0.1 password=geheim)" || fail "the appliance does not start"
 (ctl --json watch; echo "{\"ended\": $?}") >"$LAB/watched" &
 watch=$!
@@ -153,10 +155,50 @@ ctl bypass delete 10.0.0.0/8 >/dev/null; ctl intercept delete 51 >/dev/null
     [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&
     [ "$(completed walk --le)" = --leaves ] || fail "the shell completes otherwise"
 if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
-    lab_in a1 setpriv --reuid 65534 --clear-groups "$WCCP_BIN/mgmtctl" get $G/weight 2>"$LAB/complained"
-    [ $? = 3 ] || fail "another user gets an answer"
-    complains '*only root and the user that mgmtd runs as may use it'
+    as=(setpriv --reuid 65534 --regid 65534 --clear-groups)
+    expect 3 '' get $G/weight
+    complains '*only root, the user that mgmtd runs as and the group wccpd may use it'
+    as=(setpriv --reuid 65534 --regid 65534 --groups "$(getent group wccpd | cut -d: -f3 | grep . || echo 2999)")
+    expect 0 100 get $G/weight
+    expect 0 'jq:.groups[0].password' --json show
+    for words in "get $G/password" 'walk /' "get $S/debug" export 'export --json' "get /mgmtd/config/state/text" 'diff 1'; do
+        # shellcheck disable=SC2086
+        ctl $words --secrets >"$LAB/said" 2>"$LAB/complained" && [ -s "$LAB/said" ] && ! grep -q geheim "$LAB/said" ||
+            fail "a viewer's $words"
+    done
+    expect 1 '' set $G/weight 7
+    complains 'mgmtctl: user 65534 may look, but not change anything'
+    expect 1 '' rollback 2
+    as=()
 fi
+
+# The configuration as a whole
+
+ctl export >"$LAB/exported"
+expect 0 'nothing to change' apply --check - <"$LAB/exported"
+sed 's/weight = .*//; $a [/qv/wccpd/wccp/policy_grp/config/5]' "$LAB/exported" >"$LAB/applied"
+expect 1 'add    /qv/wccpd/wccp/policy_grp/config/5 = 5' apply --check - <"$LAB/applied"
+expect 2 '' apply - <"$LAB/applied"
+complains '*there is nobody to ask: add --yes, or --check'
+expect 2 'jq:.exit == 2 and (.error | startswith("standard input:1: "))' --json apply --check - <<<nonsense
+expect 0 'jq:.done and .changes[0].after == 5 and .confirm_minutes == 3' --json apply --yes --confirm 3 - <"$LAB/applied"
+expect 1 '' set $G/weight 8
+complains 'mgmtctl: commit [0-9]* waits until * to be confirmed; "mgmtctl confirm" keeps it, "mgmtctl rollback [0-9]*" undoes it'
+expect 0 'jq:.[0].confirm_by != null and .[0].cause == "apply" and .[0].user == "root"' --json history
+expect 0 'commit * confirmed' confirm
+expect 4 '' confirm
+expect 0 'add    /qv/wccpd/wccp/policy_grp/config/5 = 5' diff
+last=$(ctl --json history | jq '.[1].commit')
+[[ " $(completed rollback '') " == *" $last "* ]] || fail "the shell does not complete commits"
+expect 0 $'delete /qv/wccpd/wccp/policy_grp/config/5 (was 5)\ncommit *' rollback "$last"
+expect 4 '' diff 9999
+lab_in a1 tee /tmp/applied <"$LAB/applied" >/dev/null
+for answer in n y; do
+    lab_in a1 script -qec "'$WCCP_BIN/mgmtctl' apply /tmp/applied" /dev/null <<<$answer >"$LAB/said" 2>&1
+    [ $? = "$([ $answer = y ] && echo 0 || echo 1)" ] && grep -q 'apply this? \[y/N\]' "$LAB/said" || fail "asked, and answered $answer"
+done
+expect 0 5 get /qv/wccpd/wccp/policy_grp/config/5
+expect 0 '' delete /qv/wccpd/wccp/policy_grp/config/5
 
 lab_wait_event 60 a1 '^alarm raised: .*51' || fail "no alarm of a router that is gone"
 expect 6 '*adjacency*grp:51*' alarms --check
@@ -198,8 +240,7 @@ if lab_in a1 chown 1 /tmp/gcl-socks/uds-provider-mgmtd; then # not where only on
     complains "mgmtctl: /tmp/gcl-socks/uds-provider-mgmtd belongs to user 1; *"
     lab_in a1 chown 0 /tmp/gcl-socks/uds-provider-mgmtd
 fi
-lab_in a1 bash -c 'ls /tmp/gcl-socks | grep -c mgmtctl' >"$LAB/said"
-[ "$(cat "$LAB/said")" = 1 ] || fail "questions leave sockets behind" # the watch has one
+! lab_in a1 ls /tmp/gcl-socks | grep mgmtctl || fail "questions leave sockets behind"
 
 wait $watch_one
 [ "$(cut -d' ' -f2- <"$LAB/watched-one")" = "modify $G/weight = 7 (was 100)

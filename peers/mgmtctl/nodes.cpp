@@ -44,7 +44,8 @@ static const std::vector<node_name> &patterns() {
                 made.push_back(parsed_name(pattern));
         for (const char *pattern : {NODE_ALARMS_RAISED "/*/*/name", NODE_ALARMS_RAISED "/*/*/since",
                                     NODE_ALARMS_RAISED "/*/*/reporter", NODE_ROLES "/*/code",
-                                    NODE_ROLES "/*/since", NODE_LEFT_GROUPS "/*"})
+                                    NODE_ROLES "/*/since", NODE_LEFT_GROUPS "/*", NODE_CONFIG_TEXT,
+                                    NODE_COMMITS "/*/text"})
             made.push_back(parsed_name(pattern));
         return made;
     }();
@@ -123,7 +124,7 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
 
 static bool is_state(const node_name &name) {
     for (const char *root : {NODE_WCCPD_STATE, NODE_GROUP_STATE, NODE_PLANE_STATE, NODE_TUNNEL_STATE,
-                             NODE_INTERCEPT_STATE, NODE_ALARM_STATE})
+                             NODE_INTERCEPT_STATE, NODE_ALARM_STATE, NODE_CONFIG_STATE})
         if (name == parsed_name(root) || name.is_under(parsed_name(root)))
             return true;
     return false;
