@@ -301,6 +301,7 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
                              "  refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
                              "  packets come in fragments, and the MSS of no flow has been clamped\n"})
         EXPECT_NE(screen.find(text), std::string::npos) << text << "\nnot in\n" << screen;
+    EXPECT_EQ(screen.find(" \n"), std::string::npos) << screen;
     const json traffic = json::parse(draw_json(shown))["traffic"];
     EXPECT_EQ(traffic["refused_sources"]["10.0.0.9"], 9);
     EXPECT_EQ(traffic["tunnels"][0]["in"]["bytes"], 999999999);
@@ -347,6 +348,15 @@ TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
               "the router redirects this appliance's own traffic\n"
               "refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
               "packets come in fragments, and the MSS of no flow has been clamped\n");
+    const auto lists_all = [&] {
+        return printed([&] { return tell_tunnels(options, link); }, CTL_OK).find("not listed") ==
+               std::string::npos;
+    };
+    for (int i = 0; i < 255; i++) {
+        EXPECT_TRUE(lists_all()) << i;
+        from.add(NODE_PLANE_STATE "/refused_source/10.9.0." + std::to_string(i), "1");
+    }
+    EXPECT_FALSE(lists_all());
     EXPECT_EQ(printed([&] { return tell_intercepts(options, link, ""); }, CTL_OK),
               "51 port 80 443 to 3128 check http /a\n  proxy down 0:10:40: refused?[2J\n"
               "  in 120  to proxy 100  returned 12  proxy down 8\n"

@@ -1378,6 +1378,20 @@ TEST(Supervision, ALossIsReportedWhenNobodyTakesOverInTime) {
     (void)supervisor_tick(&self);
     told.clear();
 
+    // That it is replaced each time doesn't hide that it keeps crashing.
+    now += 2 * CRASHES_EVERY_MS;
+    said.clear();
+    for (int crash = 0; crash < 9; crash++) {
+        open_session();
+        EXPECT_EQ(end(SIGKILL, 20000), TAKE_OVER_MS);
+    }
+    open_session();
+    const size_t warned = said.find("crashed 4 times in 60 s\n");
+    ASSERT_NE(warned, std::string::npos) << said;
+    EXPECT_EQ(said.find("crashed"), warned) << said;
+    EXPECT_EQ(said.find("crashed", said.rfind("crashed 4 times in 60 s\n") + 1), std::string::npos) << said;
+    EXPECT_EQ(told, strings{});
+
     // An orderly end is one, and so is the end of everything.
     open_session();
     EXPECT_GE(end(SIGTERM, 1000), RESTART_DELAY_FIRST_MS);

@@ -122,6 +122,11 @@ case_proxy_down() {
     state_is a1 5 intercept '.["51"].left'
     [ "$(lab_manage a1 get /qv/wccpd/wccp/srv_grp/config/51/admin | jq -r '[.. | .value? // empty][0]')" = up ] || die "the configuration has changed"
     fetches "$direct" --count 8
+    # shellcheck disable=SC2086
+    configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 "${quick%% *}" ${quick#* } leave_after=0)"
+    router_is r1 30 51 '$g.appliances != []'
+    state_is a1 5 intercept '.["51"].left | not'
+    fetches "$direct" --count 8
     lab_proxy a1
     ready 51 a1
     fetches_within 5 "$(by a1)" --count 4

@@ -285,7 +285,7 @@ static void draw_router(screen *on, const snapshot_router &router) {
     } else {
         add_cells(&line, format("%-7s", router.connection.c_str()),
                   router.connection == "two-way" ? style::good : style::warn);
-        add_cells(&line, format("  %8s  fwd %-3s  assign %-4s  return %-3s",
+        add_cells(&line, format("  %8s  fwd %-3s  assign %-4s  return %s",
                                 duration_text(router.connected_ms).c_str(), method(router.forward),
                                 method(router.assign), method(router.back)));
         if (router.id != router.address)

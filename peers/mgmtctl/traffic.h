@@ -53,7 +53,7 @@ struct traffic_state {
     uint64_t own = 0;          // redirected packets of this appliance itself
     uint64_t clamped = 0;      // SYN-ACKs
     refused_counts refused;
-    std::map<std::string, uint64_t> refused_sources; // packets by address
+    std::map<std::string, uint64_t> refused_sources; // packets by address, REFUSED_SOURCES_MAX at most
     std::vector<traffic_tunnel> tunnels;             // by id
     std::vector<traffic_intercept> intercepts;       // by group
     // From mgmtd, also without a tunneld:

@@ -13,6 +13,7 @@
 #include "peers/mgmtctl/render.h"
 #include "peers/mgmtctl/show_model.h"
 #include "peers/mgmtctl/traffic_json.h"
+#include "peers/nodes/value_lists.h"
 
 // --- Changes
 
@@ -250,6 +251,8 @@ static void put_tunnels(const traffic_state &traffic) {
             "\n  sorted: " + sorted_text(tunnel.sorted) + "\n" + refused_text(tunnel.refused));
     for (const auto &[address, packets] : traffic.refused_sources)
         put("refused " + count_text(packets) + " from " + address + "\n");
+    if (traffic.refused_sources.size() >= REFUSED_SOURCES_MAX)
+        put("refused sources beyond these " + std::to_string(REFUSED_SOURCES_MAX) + " are not listed\n");
 }
 
 int tell_tunnels(const ctl_options &options, const ctl_link &link) {

@@ -6,7 +6,8 @@
 #include <cstddef>
 #include <string>
 
-constexpr size_t LIST_MAX_ENTRIES = 64; // of a list, once overlapping entries are merged
+constexpr size_t LIST_MAX_ENTRIES = 64;     // of a list, once overlapping entries are merged
+constexpr size_t REFUSED_SOURCES_MAX = 256; // addresses that a data plane counts refused packets by
 
 // "all", or ports and ranges separated by blanks: "80 443 8000-8080". Kept sorted, with ranges merged.
 const char *check_ports(std::string *inout);

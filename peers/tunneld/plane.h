@@ -39,7 +39,7 @@ struct link_counters {
 };
 struct plane_counters {
     std::map<std::string, link_counters> links;   // by interface name
-    std::map<uint32_t, uint64_t> refused_sources; // by address, host order; the first 256
+    std::map<uint32_t, uint64_t> refused_sources; // by address, host order; REFUSED_SOURCES_MAX
     uint64_t refused[REFUSALS] = {};              // that belong to no link
 };
 

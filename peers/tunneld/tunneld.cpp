@@ -201,6 +201,11 @@ void follow_health(tunneld *daemon) {
             continue;
         }
         outage &down = daemon->outages.try_emplace(group, outage{now, false}).first->second;
+        if (down.left && rules.leave_after_s == 0) {
+            LC_LOG(LC_LOG_NOTICE, "Group %d joins its routers again: it is no longer to leave them", group);
+            mgmt_link_group_joins(daemon->management, group);
+            down = {now, false};
+        }
         if (down.left || rules.leave_after_s == 0 ||
             now - down.since_ms < int64_t{rules.leave_after_s} * 1000)
             continue;

@@ -24,6 +24,7 @@
 #include <thread>
 #include <unordered_map>
 
+#include "peers/nodes/value_lists.h"
 #include "peers/tunneld/coalesce.h"
 #include "peers/tunneld/gre.h"
 #include "peers/tunneld/plane.h"
@@ -40,7 +41,6 @@ constexpr uint32_t RING_BATCH = 256; // packets that wait for a flush at most
 constexpr uint32_t BUSY_PACKETS = 8;
 constexpr timespec GATHER_TIME = {0, 50000};
 constexpr int THREAD_NICE = -10; // the ring overflows while the thread waits for a processor
-constexpr size_t REFUSED_SOURCES = 256;
 constexpr int OUTER_TTL = 64, SEND_BUFFER = 8 << 20;
 constexpr uint64_t WAKE_SERIAL = 0, RING_SERIAL = 1, FIRST_LINK_SERIAL = 2;
 
@@ -183,7 +183,7 @@ void refuse_source(user_state *plane, const gre_outer &outer) {
     const auto known = plane->refused_sources.find(outer.remote);
     if (known != plane->refused_sources.end())
         known->second++;
-    else if (plane->refused_sources.size() < REFUSED_SOURCES)
+    else if (plane->refused_sources.size() < REFUSED_SOURCES_MAX)
         plane->refused_sources[outer.remote] = 1;
 }
 
