@@ -79,7 +79,7 @@ int run_router(char **words) {
     sigemptyset(&ends);
     sigaddset(&ends, SIGTERM);
     sigprocmask(SIG_BLOCK, &ends, nullptr);
-    const link_wish wish = {1, address_of(words[0]), address_of(words[1]), false};
+    const link_wish wish = {1, address_of(words[0]), address_of(words[1])};
     if (!user_plane.open(&error) || !user_plane.make_link(words[2], wish, &index, &error)) {
         fprintf(stderr, "traffic_load: %s\n", error.c_str());
         return 1;

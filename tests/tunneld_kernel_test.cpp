@@ -220,12 +220,11 @@ TEST(wanted_state, links_keep_their_numbers) {
     const std::vector<wanted_link> before = make_wanted_state(two_tunnels(), {}, false).links;
     const auto links = make_wanted_state(view, before, false).links;
     // wccp0 is still there when the new one is made.
-    EXPECT_EQ(links, (std::vector<wanted_link>{{"wccp1", {9, LOCAL, R2, false}},
-                                               {"wccp2", {1, LOCAL, OTHER, false}}}));
+    EXPECT_EQ(links, (std::vector<wanted_link>{{"wccp1", {9, LOCAL, R2}}, {"wccp2", {1, LOCAL, OTHER}}}));
 }
 
 TEST(link_names, only_ours_are_read) {
-    const link_wish wish = {65535, LOCAL, R1, true};
+    const link_wish wish = {65535, LOCAL, R1, link_kind::accepted};
     EXPECT_EQ(link_alias(wish), "tunneld 65535 10.0.0.101 10.0.0.1 accepted");
     EXPECT_EQ(parse_link_alias(link_alias(wish)), wish);
     for (const std::string alias :
@@ -488,7 +487,7 @@ TEST_F(kernel_state, what_a_killed_program_leaves_is_taken_over) {
     run_program([&] {
         const uint32_t index = if_nametoindex("wccp0"), unmarked = if_nametoindex("wccp1");
         const auto before = find_own_links();
-        EXPECT_EQ(before, (std::vector<wanted_link>{{"wccp0", {3, LOCAL, R1, false}}}));
+        EXPECT_EQ(before, (std::vector<wanted_link>{{"wccp0", {3, LOCAL, R1}}}));
         const auto wanted = make_wanted_state(view, before, true);
         EXPECT_EQ(reconcile(wanted), "");
         EXPECT_EQ(find_ours(), links_and_tables(wanted));

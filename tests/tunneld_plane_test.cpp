@@ -421,7 +421,7 @@ int child_main(int commands, int answers) {
             result = send_partial();
         else if (command == 'p')
             result = !user_plane.open(&error) ||
-                     !user_plane.make_link("wccp0", {1, ROUTER, APPLIANCE, false}, &index, &error) ||
+                     !user_plane.make_link("wccp0", {1, ROUTER, APPLIANCE}, &index, &error) ||
                      system("ip addr add 192.168.9.2/24 dev wccp0 && ip link set wccp0 up") != 0;
         else if (command == 'e')
             result = echo_once();
@@ -507,7 +507,7 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     user_plane_settings.redirect_header = true;
     ASSERT_TRUE(user_plane.probe(&error)) << error;
     ASSERT_TRUE(user_plane.open(&error)) << error;
-    const link_wish wish = {1, APPLIANCE, ROUTER, false};
+    const link_wish wish = {1, APPLIANCE, ROUTER};
     ASSERT_TRUE(user_plane.make_link("wccp0", wish, &index, &error)) << error;
     EXPECT_EQ(index, if_nametoindex("wccp0"));
     shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && ip route add 203.0.113.0/24 dev "

@@ -26,7 +26,14 @@ struct tcp_wire_header {
     be16 window, checksum, urgent;
 };
 static_assert(sizeof(tcp_wire_header) == 20 && alignof(tcp_wire_header) == 1);
-enum : uint8_t { TCP_FIN = 0x01, TCP_PSH = 0x08, TCP_ACK = 0x10, TCP_CWR = 0x80 };
+enum : uint8_t {
+    TCP_FIN = 0x01,
+    TCP_SYN = 0x02,
+    TCP_RST = 0x04,
+    TCP_PSH = 0x08,
+    TCP_ACK = 0x10,
+    TCP_CWR = 0x80,
+};
 
 struct udp_wire_header {
     be16 source_port, destination_port, length, checksum;

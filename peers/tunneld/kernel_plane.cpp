@@ -90,4 +90,5 @@ void read_counters(plane_counters *inout) {
 
 } // namespace
 
-const data_plane kernel_plane = {"kernel", probe, open_plane, [] {}, make_link, drop_link, read_counters};
+const data_plane kernel_plane = {"kernel",  probe,     open_plane,    [] {},
+                                 make_link, drop_link, read_counters, nullptr};

@@ -44,7 +44,8 @@ struct failure {
 };
 
 bool same_ends(const link_wish &one, const link_wish &other) {
-    return one.local == other.local && one.remote == other.remote;
+    return one.local == other.local && one.remote == other.remote &&
+           (one.kind == link_kind::passing) == (other.kind == link_kind::passing);
 }
 
 const wanted_link *find_wanted(const wanted_state &wanted, const std::string &name) {
@@ -262,6 +263,8 @@ bool reconcile_kernel_state(const data_plane &plane, const wanted_state &wanted,
     std::string error;
     if (!apply_sorting_rules(wanted.sorting, &error))
         failed.note(error);
+    if (plane.set_passing)
+        plane.set_passing(wanted.passing);
     remove_unwanted(plane, wanted, there, &failed);
     return failed.give(out_error);
 }
@@ -282,8 +285,13 @@ bool reconcile_kernel_links(const data_plane &plane, const wanted_state &wanted,
     add_routes(missing, there.routes, &failed);
     add_rules(wanted, there.rules, &failed);
     // The number of a link that goes may be another's soon, and its table with it.
+    const auto is_of_link = [&](uint32_t table) {
+        return std::any_of(wanted.links.begin(), wanted.links.end(), [&](const wanted_link &link) {
+            return table == TABLE_LINK_FIRST + link_number(link.name).value_or(0);
+        });
+    };
     for (const auto &one : there.routes)
-        if (one.route.table != TABLE_LOCAL &&
+        if (one.route.table != TABLE_LOCAL && !is_of_link(one.route.table) &&
             std::none_of(wanted.routes.begin(), wanted.routes.end(),
                          [&](const wanted_route &route) { return route.table == one.route.table; }))
             failed.note("cannot remove " + route_text(one.route), remove_route(one));

@@ -10,6 +10,7 @@ namespace {
 
 constexpr char LINK_PREFIX[] = "wccp";
 constexpr size_t ALIAS_CHARACTERS = 80;
+constexpr const char *kind_words[] = {"", "accepted", "member", "passing"}; // by link_kind
 
 } // namespace
 
@@ -34,7 +35,8 @@ std::optional<uint32_t> link_number(const std::string &name) {
 
 std::string link_alias(const link_wish &wish) {
     return "tunneld " + std::to_string(wish.tunnel_id) + " " + address_text(wish.local) + " " +
-           address_text(wish.remote) + (wish.accepted ? " accepted" : "");
+           address_text(wish.remote) + (*kind_words[static_cast<size_t>(wish.kind)] ? " " : "") +
+           kind_words[static_cast<size_t>(wish.kind)];
 }
 
 std::optional<link_wish> parse_link_alias(const std::string &alias) {
@@ -45,10 +47,12 @@ std::optional<link_wish> parse_link_alias(const std::string &alias) {
         sscanf(alias.c_str(), "tunneld %5hu %15s %15s %9s", &id, local, remote, word) < 3 ||
         inet_pton(AF_INET, local, &from) != 1 || inet_pton(AF_INET, remote, &to) != 1)
         return std::nullopt;
-    const link_wish wish = {id, ntohl(from.s_addr), ntohl(to.s_addr), word[0] != '\0'};
-    if (link_alias(wish) != alias) // written in any other way: not by us
-        return std::nullopt;
-    return wish;
+    for (size_t kind = 0; kind < std::size(kind_words); kind++) {
+        const link_wish wish = {id, ntohl(from.s_addr), ntohl(to.s_addr), static_cast<link_kind>(kind)};
+        if (link_alias(wish) == alias) // written in any other way: not by us
+            return wish;
+    }
+    return std::nullopt;
 }
 
 bool is_interface_name(const std::string &name) {

@@ -7,6 +7,7 @@
 #include <cstring>
 #include <fstream>
 
+#include "peers/tunneld/passing.h"
 #include "runtime/logging.h"
 #include "runtime/ttime.h"
 
@@ -41,6 +42,14 @@ std::string read_file(const char *path) {
 
 owners_table load_owners() {
     return read_owners_file(read_file(OWNERS_FILE), now_s());
+}
+
+passing_table load_passing() {
+    return read_passing_file(read_file(PASSING_FILE));
+}
+
+void save_passing(const passing_table &table) {
+    write_file(PASSING_FILE, passing_file_text(table));
 }
 
 bool take_owners(owners_table *owners, uint8_t group, const std::string &text, uint32_t protection_s) {

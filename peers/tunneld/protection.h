@@ -6,14 +6,19 @@
 #include <map>
 #include <string>
 
+#include "peers/tunneld/plane.h"
 #include "peers/tunneld/session.h"
 #include "peers/tunneld/slot_owners.h"
 #include "peers/tunneld/view.h"
 
 constexpr const char *OWNERS_FILE = "/run/tunneld/owners";
+constexpr const char *PASSING_FILE = "/run/tunneld/passing";
 
-// What an earlier tunneld has kept. A file that is missing or bad is an empty table.
+// What an earlier tunneld has kept. A file that is missing or bad is an empty table. The kernel keeps what it
+// passes on itself; for the user-space plane it is the second.
 owners_table load_owners();
+passing_table load_passing();
+void save_passing(const passing_table &table);
 // Takes in wccpd's text about a group and keeps what has changed. True when something has.
 bool take_owners(owners_table *owners, uint8_t group, const std::string &text, uint32_t protection_s);
 // Drops groups that are no longer configured.

@@ -6,6 +6,7 @@
 #include <cctype>
 #include <cstdio>
 
+#include "peers/tunneld/slot_owners.h"
 #include "peers/tunneld/sorting_rules.h"
 
 const char *const sorted_words[SORTED_WAYS] = {"in",        "to_proxy", "bypassed", "returned", "down",
@@ -96,6 +97,10 @@ void take_ports(taken_ports *taken, uint32_t first, uint32_t last, uint8_t group
     }
 }
 
+std::string port_text(uint32_t first, uint32_t last) {
+    return first == last ? format("%u", first) : format("%u-%u", first, last);
+}
+
 // Everything below here fills one nft_content.
 struct content_maker {
     const wanted_sorting &wanted;
@@ -127,16 +132,76 @@ void add_way_chains(content_maker &maker) {
     const std::string unmarked = format("meta mark != 0x%08x ", MARK_LOCAL);
     for (const char *way : {"returned", "bypassed", "own", "down", "overload"})
         maker.rules(way) = {count(way), unmarked + "meta mark set iifname map @give_back"};
+    maker.rules("passed") = {count("passed")};
     maker.rules("to_proxy") = {mark_as(MARK_LOCAL), count("to_proxy")};
     maker.rules("forwarded") = {unmarked + mark_as(MARK_FORWARD), count("forwarded")};
     maker.rules("dropped") = {count("dropped"), "drop"};
     maker.rules("down_dropped") = {count("down"), "drop"};
 }
 
-void add_group(content_maker &maker, const sorted_group &group) {
+// The masked fields of a packet as the key of a map, and those of a slot's value. Without a field all packets
+// belong to the one slot.
+struct mask_field {
+    const char *name, *type;
+    bool is_port;
+    uint32_t (*of)(const slot_mask &mask);
+};
+constexpr mask_field mask_fields[] = {
+    {"ip saddr", "ipv4_addr", false, [](const slot_mask &mask) { return mask.src_ip; }},
+    {"ip daddr", "ipv4_addr", false, [](const slot_mask &mask) { return mask.dst_ip; }},
+    {"tcp sport", "inet_service", true, [](const slot_mask &mask) { return uint32_t{mask.src_port}; }},
+    {"tcp dport", "inet_service", true, [](const slot_mask &mask) { return uint32_t{mask.dst_port}; }},
+};
+
+std::string field_text(const mask_field &field, const slot_mask &of) {
+    return field.is_port ? format("%u", field.of(of)) : address_text(field.of(of));
+}
+
+// For each field that the mask has: the text that `make` gives, as one concatenation.
+template <typename F>
+std::string join_fields(const slot_mask &mask, F make) {
+    std::string text;
+    for (const mask_field &field : mask_fields)
+        if (field.of(mask) != 0)
+            text += (text.empty() ? "" : " . ") + std::string(make(field));
+    return text;
+}
+
+// The rule that passes on what belongs to other appliances, but the match that comes before it. "": nothing
+// is ever passed on.
+std::string make_pass_rule(content_maker &maker, const sorted_group &group) {
+    if (group.pass_marks.empty())
+        return "";
+    const std::string end = " " + group_counter(group.group, SORTED_PASSED) + " goto passed";
+    if (slot_mask_bits(group.mask) == 0)
+        return group.pass_marks[0] ? mark_as(group.pass_marks[0]) + end : "";
+    const std::string name = format("pass/%u", group.group);
+    nft_set &map = maker.set(name, "map { type " + join_fields(group.mask, [](const mask_field &field) {
+                                       return field.type;
+                                   }) + " : mark; }");
+    for (uint32_t slot = 0; slot < group.pass_marks.size(); slot++)
+        if (group.pass_marks[slot]) {
+            const slot_mask value = slot_value(group.mask, slot);
+            map.elements[join_fields(group.mask, [&](const mask_field &field) {
+                return field_text(field, value);
+            })] = format("0x%08x", group.pass_marks[slot]);
+        }
+    return "meta mark set " +
+           join_fields(group.mask,
+                       [&](const mask_field &field) {
+                           return "(" + std::string(field.name) + " & " + field_text(field, group.mask) + ")";
+                       }) +
+           " map @" + name + end;
+}
+
+void add_group_counters(content_maker &maker, const sorted_group &group) {
     for (const sorted_as way : {SORTED_TO_PROXY, SORTED_BYPASSED, SORTED_RETURNED, SORTED_DOWN,
-                                SORTED_FORWARDED, SORTED_DROPPED, SORTED_OVERLOAD})
-        maker.add_counter(format("group/%u/%s", group.group, sorted_words[way]));
+                                SORTED_FORWARDED, SORTED_DROPPED, SORTED_OVERLOAD, SORTED_PASSED})
+        if (wants_something(group) || (way == SORTED_PASSED && !group.pass_marks.empty()))
+            maker.add_counter(format("group/%u/%s", group.group, sorted_words[way]));
+}
+
+void add_group(content_maker &maker, const sorted_group &group) {
     std::vector<std::string> &rules = maker.rules(group_chain(group.group));
     const intercept &wish = group.rules;
     const auto ends_as = [&](sorted_as way, const char *chain) {
@@ -146,7 +211,10 @@ void add_group(content_maker &maker, const sorted_group &group) {
         for (const char *end : {"saddr", "daddr"})
             rules.push_back(format("ip %s { ", end) + join(merge_prefixes(wish.bypass)) + " } " +
                             ends_as(SORTED_BYPASSED, "bypassed"));
-    // A flow that began before it was redirected stays with its server.
+    // A flow that began before it was redirected stays with its server, unless it is another appliance's.
+    const std::string pass = wish.protocol == 6 ? make_pass_rule(maker, group) : "";
+    if (!pass.empty())
+        rules.push_back(NOT_JUST_SYN + (" " + pass));
     if (wish.protocol == 6)
         rules.push_back(NOT_JUST_SYN + (" " + ends_as(SORTED_RETURNED, "returned")));
     const intercept_condition &now = group.condition;
@@ -190,6 +258,28 @@ std::string make_rest_rule(const std::vector<const sorted_group *> &groups) {
     return rule;
 }
 
+// Groups without an intercept bring the answers of servers to what other groups intercept.
+void add_reply_rules(content_maker &maker, const std::vector<const sorted_group *> &groups,
+                     std::vector<std::string> *out) {
+    for (const sorted_group *group : groups) {
+        const std::string pass = wants_something(*group) ? "" : make_pass_rule(maker, *group);
+        if (pass.empty())
+            continue;
+        std::string ports;
+        if (!group->pass_ports.empty()) {
+            const std::string name = format("answers/%u", group->group);
+            nft_set &set = maker.set(name, "set { type inet_service; flags interval; }");
+            taken_ports taken;
+            for (const port_range &range : group->pass_ports)
+                take_ports(&taken, range.first, range.last, 0);
+            for (const auto &[first, end] : taken)
+                set.elements[port_text(first, end.first)] = "";
+            ports = "tcp sport @" + name + " ";
+        }
+        out->push_back(NOT_JUST_SYN + (" " + ports) + pass);
+    }
+}
+
 // The chain for interfaces that have the same groups, named after the first of them.
 void add_class(content_maker &maker, const std::string &name,
                const std::vector<const sorted_group *> &groups) {
@@ -209,10 +299,10 @@ void add_class(content_maker &maker, const std::string &name,
         const std::string map_name = "ports/" + name + "/" + word;
         nft_set &map = maker.set(map_name, "map { type inet_service : verdict; flags interval; }");
         for (const auto &[first, end] : taken)
-            map.elements[first == end.first ? format("%u", first) : format("%u-%u", first, end.first)] =
-                "goto " + group_chain(end.second);
+            map.elements[port_text(first, end.first)] = "goto " + group_chain(end.second);
         rules.push_back(std::string(word) + " dport vmap @" + map_name);
     }
+    add_reply_rules(maker, groups, &rules);
     rules.push_back(make_rest_rule(groups));
 }
 
@@ -238,6 +328,20 @@ void add_arrival_chains(content_maker &maker) {
         arrivals.elements[quoted(name)] = "goto arrived_l2";
     for (const std::string &name : maker.wanted.links)
         arrivals.elements[quoted(name)] = "goto arrived";
+    for (const std::string &name : maker.wanted.members)
+        arrivals.elements[quoted(name)] = "goto arrived_member";
+    for (const std::string &name : maker.wanted.passing)
+        arrivals.elements[quoted(name)] = "goto arrived_passing";
+    // Passed on at most once: what another appliance has passed on is looked up nowhere.
+    for (const auto &[chain, nobodys] :
+         {std::pair{"arrived_member", "goto returned"}, std::pair{"arrived_passing", "goto passed"}})
+        maker.rules(chain) = {
+            "counter name iifname map @count_in",
+            "socket transparent 1 socket wildcard 0 goto to_proxy",
+            std::string("socket wildcard 1 ") + nobodys,
+            NOT_JUST_SYN + std::string(" socket transparent 1 goto to_proxy"),
+            nobodys,
+        };
     maker.content.chains["sort"] = {"type filter hook prerouting priority -150; policy accept;",
                                     {"iifname vmap @arrivals"}};
     maker.rules("arrived_l2") = {"fib daddr type != unicast accept", "meta pkttype != host accept",
@@ -316,7 +420,8 @@ void add_outer_chains(content_maker &maker) {
 
 bool check_sorting(const wanted_sorting &wanted, std::string *out_error) {
     std::vector<std::string> names = wanted.links;
-    names.insert(names.end(), wanted.l2_interfaces.begin(), wanted.l2_interfaces.end());
+    for (const auto *more : {&wanted.l2_interfaces, &wanted.members, &wanted.passing})
+        names.insert(names.end(), more->begin(), more->end());
     for (const auto &[name, mark] : wanted.l2_into_gre)
         names.push_back(name);
     for (const std::string &name : names)
@@ -330,6 +435,11 @@ bool check_sorting(const wanted_sorting &wanted, std::string *out_error) {
             good &= range.first <= range.last;
         for (const ip_prefix &prefix : group.rules.bypass)
             good &= prefix.length <= 32;
+        for (const port_range &range : group.pass_ports)
+            good &= range.first <= range.last;
+        good &=
+            group.pass_marks.empty() || (slot_mask_bits(group.mask) <= 7 &&
+                                         group.pass_marks.size() == size_t{1} << slot_mask_bits(group.mask));
         if (!good) {
             *out_error = format("intercept of group %u: bad protocol, ports or prefix", group.group);
             return false;
@@ -353,11 +463,14 @@ bool make_sorting_content(const wanted_sorting &wanted, nft_content *out, std::s
         return true;
     content_maker maker{wanted, *out, {}};
     maker.interfaces.insert(wanted.links.begin(), wanted.links.end());
-    maker.interfaces.insert(wanted.l2_interfaces.begin(), wanted.l2_interfaces.end());
+    for (const auto *more : {&wanted.l2_interfaces, &wanted.members, &wanted.passing})
+        maker.interfaces.insert(more->begin(), more->end());
     add_way_chains(maker);
-    for (const sorted_group &group : wanted.groups)
+    for (const sorted_group &group : wanted.groups) {
+        add_group_counters(maker, group);
         if (wants_something(group))
             add_group(maker, group);
+    }
     add_classes(maker);
     add_arrival_chains(maker);
     add_departure_chain(maker);

@@ -46,5 +46,5 @@ void read_counters(plane_counters *inout) {
 
 } // namespace
 
-const data_plane table_plane = {"table",   succeed,   succeed,      [] { links.clear(); },
-                                make_link, drop_link, read_counters};
+const data_plane table_plane = {"table",   succeed,   succeed,       [] { links.clear(); },
+                                make_link, drop_link, read_counters, nullptr};

@@ -110,8 +110,8 @@ void note_indices(tunneld *daemon) {
         tunnel.index = WCCP_NO_INDEX;
         for (const wanted_link &link : daemon->links)
             if (const auto index = daemon->indices.find(link.name);
-                !link.wish.accepted && link.wish.local == tunnel.local && link.wish.remote == tunnel.remote &&
-                index != daemon->indices.end())
+                link.wish.kind == link_kind::tunnel && link.wish.local == tunnel.local &&
+                link.wish.remote == tunnel.remote && index != daemon->indices.end())
                 tunnel.index = index->second;
     }
 }
@@ -119,14 +119,17 @@ void note_indices(tunneld *daemon) {
 void reconcile(tunneld *daemon) {
     if (daemon->plane == &table_plane)
         return;
-    wanted_state wanted =
-        make_wanted_state(view_appliance(*daemon), daemon->links, daemon->plane == &user_plane);
+    wanted_state wanted = make_wanted_state(view_appliance(*daemon), daemon->links,
+                                            daemon->plane == &user_plane, daemon->takes_over);
     if (daemon->applied == wanted && lt_monotonic_ms() < daemon->again_at_ms)
         return;
     std::string error;
     (void)(daemon->takes_over ? reconcile_kernel_links : reconcile_kernel_state)(*daemon->plane, wanted,
                                                                                  &daemon->indices, &error);
     report_failure(daemon, error);
+    const passing_table none;
+    if (!daemon->takes_over && wanted.passing != (daemon->applied ? daemon->applied->passing : none))
+        save_passing(wanted.passing);
     daemon->links = wanted.links;
     daemon->applied = std::move(wanted);
     note_indices(daemon);
@@ -430,14 +433,16 @@ void take_over(tunneld *daemon) {
     if (!daemon->takes_over)
         return;
     for (const wanted_link &link : daemon->links)
-        if (!link.wish.accepted)
+        if (link.wish.kind == link_kind::tunnel)
             daemon->desk.tunnels[link.wish.tunnel_id] = {link.wish.local, link.wish.remote, WCCP_NO_INDEX};
     for (const wanted_link &link : daemon->links)
         if (const auto beside = daemon->desk.tunnels.find(link.wish.tunnel_id);
-            link.wish.accepted && beside != daemon->desk.tunnels.end())
+            link.wish.kind == link_kind::accepted && beside != daemon->desk.tunnels.end())
             daemon->configured.accepted.push_back({link.wish.remote, beside->second.remote});
     LC_LOG(LC_LOG_NOTICE, "%zu tunnels are taken over", daemon->desk.tunnels.size());
     reconcile(daemon);
+    if (daemon->plane->set_passing)
+        daemon->plane->set_passing(load_passing());
 }
 
 void start_plane(tunneld *daemon) {

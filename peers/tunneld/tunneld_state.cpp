@@ -36,7 +36,7 @@ void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorti
     for (const wanted_link &link : daemon.links) {
         const auto index = daemon.indices.find(link.name);
         const auto ordered = daemon.desk.tunnels.find(link.wish.tunnel_id);
-        if (link.wish.accepted || index == daemon.indices.end() || ordered == daemon.desk.tunnels.end() ||
+        if (link.wish.kind != link_kind::tunnel || index == daemon.indices.end() || ordered == daemon.desk.tunnels.end() ||
             ordered->second.local != link.wish.local || ordered->second.remote != link.wish.remote)
             continue;
         const std::string id = std::to_string(link.wish.tunnel_id);
@@ -51,7 +51,7 @@ void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorti
         packet_count ways[SORTED_WAYS];
         uint64_t fragments = 0;
         for (const wanted_link &each : daemon.links) {
-            if (each.wish.tunnel_id != link.wish.tunnel_id)
+            if (each.wish.tunnel_id != link.wish.tunnel_id || each.wish.kind > link_kind::accepted)
                 continue;
             if (const auto found = plane.links.find(each.name); found != plane.links.end()) {
                 sum.packets_in += found->second.packets_in;

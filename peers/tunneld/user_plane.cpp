@@ -27,6 +27,7 @@
 #include "peers/nodes/value_lists.h"
 #include "peers/tunneld/coalesce.h"
 #include "peers/tunneld/gre.h"
+#include "peers/tunneld/passing.h"
 #include "peers/tunneld/plane.h"
 #include "peers/tunneld/user_ring.h"
 #include "peers/tunneld/user_tun.h"
@@ -92,6 +93,8 @@ struct user_state {
     std::atomic<bool> stop = false;
     std::map<std::string, owned_link> links; // by interface name
     std::unordered_map<uint64_t, user_link *> by_ends, by_serial;
+    std::unordered_map<uint64_t, user_link *> passing_by_ends;
+    passing_lookup passing;
     uint64_t next_serial = FIRST_LINK_SERIAL;
     uint64_t refused[REFUSALS] = {};
     std::map<uint32_t, uint64_t> refused_sources;
@@ -187,21 +190,33 @@ void refuse_source(user_state *plane, const gre_outer &outer) {
         plane->refused_sources[outer.remote] = 1;
 }
 
+// Where the packet goes to the kernel: by the link that it came in by, or as one that is another appliance's
+// unless the kernel has a socket for it. What another appliance has passed on has no redirect header.
+user_link *choose_way(user_state *plane, user_link *link, const gre_content &content) {
+    uint32_t local = 0;
+    const uint32_t member = find_passing_member(plane->passing, content, &local);
+    if (!member || link->wish.kind == link_kind::member)
+        return link;
+    const auto found = plane->passing_by_ends.find(key_of_ends(local, member));
+    return found == plane->passing_by_ends.end() || found->second->gone ? link : found->second;
+}
+
 // A packet that the sender's kernel, on this machine, or this one's receive offload has left large.
-refusal carry_large(user_state *plane, user_link *link, const ring_packet &from, const gre_content &content) {
+refusal carry_large(user_state *plane, user_link *link, user_link *way, const ring_packet &from,
+                    const gre_content &content) {
     virtio_header header = from.header;
     header.header_length = 0;
     header.checksum_start = static_cast<uint16_t>(header.checksum_start - (content.packet - from.bytes));
     uint32_t packets;
     if (!large_packet_is_valid(header, content.packet, content.length, &packets))
         return REFUSED_INNER;
-    if (header.gso_type == VIRTIO_LARGE_UDP && !link->tun.takes_large_udp)
+    if (header.gso_type == VIRTIO_LARGE_UDP && !way->tun.takes_large_udp)
         return REFUSED_ROOM;
     link->counters.packets_in += packets;
     link->counters.bytes_in += content.length;
     coalesce_flush(&plane->merger); // what came before it
     const iovec parts[2] = {{&header, sizeof header}, {content.packet, content.length}};
-    write_to_tun(link, parts, 2, packets);
+    write_to_tun(way, parts, 2, packets);
     return REFUSALS;
 }
 
@@ -213,12 +228,14 @@ refusal carry_payload(user_state *plane, user_link *link, const ring_packet &fro
         return why;
     if (user_plane_settings.redirect_header)
         remember_redirect(plane, *link, content);
+    link->counters.redirect_headers += content.has_redirect;
+    user_link *const way = choose_way(plane, link, content);
     if (merged)
-        return carry_large(plane, link, from, content);
+        return carry_large(plane, link, way, from, content);
     link->counters.packets_in++;
     link->counters.bytes_in += content.length;
-    plane->merger.merge_udp = link->tun.takes_large_udp;
-    coalesce_packet(&plane->merger, link, content.packet, content.length);
+    plane->merger.merge_udp = way->tun.takes_large_udp;
+    coalesce_packet(&plane->merger, way, content.packet, content.length);
     return REFUSALS;
 }
 
@@ -305,7 +322,7 @@ void finish_message(out_batch *batch, const gre_wire_redirect *redirect) {
 
 void give_back(user_state *plane, user_link *link, const virtio_header &header, uint8_t *packet,
                size_t length) {
-    if (length > 0 && packet[0] >> 4 != 4)
+    if ((length > 0 && packet[0] >> 4 != 4) || link->out < 0)
         return; // the kernel looks for IPv6 neighbours on every interface
     out_batch *batch = &plane->out;
     packet_split split;
@@ -488,6 +505,8 @@ void forget_link(user_state *plane, const std::string &name) {
     const auto by_ends = plane->by_ends.find(key_of_ends(link.wish.local, link.wish.remote));
     if (by_ends != plane->by_ends.end() && by_ends->second == &link)
         plane->by_ends.erase(by_ends);
+    if (link.wish.kind == link_kind::passing)
+        plane->passing_by_ends.erase(key_of_ends(link.wish.local, link.wish.remote));
     plane->by_serial.erase(link.serial);
     plane->links.erase(found); // closing takes it out of epoll
 }
@@ -515,12 +534,14 @@ bool make_link(const std::string &name, const link_wish &wish, uint32_t *out_ind
     owned_link link(new user_link);
     link->serial = plane->next_serial++;
     link->wish = wish;
-    if (!open_raw_socket(wish, &link->out, out_error) || !tun_open(name, &link->tun, out_error))
+    const bool carries = wish.kind != link_kind::passing;
+    if ((carries && !open_raw_socket(wish, &link->out, out_error)) || !tun_open(name, &link->tun, out_error))
         return false;
     if (!watch(plane, link->tun.fd, link->serial, out_error))
         return false;
     *out_index = link->tun.index;
-    plane->by_serial[link->serial] = plane->by_ends[key_of_ends(wish.local, wish.remote)] = link.get();
+    plane->by_serial[link->serial] = link.get();
+    (carries ? plane->by_ends : plane->passing_by_ends)[key_of_ends(wish.local, wish.remote)] = link.get();
     plane->links[name] = std::move(link);
     return true;
 }
@@ -548,6 +569,15 @@ void read_counters(plane_counters *inout) {
     memcpy(inout->refused, state->refused, sizeof inout->refused);
 }
 
+void set_passing(const passing_table &table) {
+    if (!state)
+        return;
+    passing_lookup lookup;
+    fill_passing_lookup(table, &lookup);
+    const guest_guard guard(state.get());
+    std::swap(state->passing, lookup);
+}
+
 bool probe(std::string *out_why_not) {
     if (!tun_probe(out_why_not))
         return false;
@@ -559,4 +589,5 @@ bool probe(std::string *out_why_not) {
 
 } // namespace
 
-const data_plane user_plane = {"user", probe, open_plane, close_plane, make_link, drop_link, read_counters};
+const data_plane user_plane = {"user",    probe,     open_plane,    close_plane,
+                               make_link, drop_link, read_counters, set_passing};

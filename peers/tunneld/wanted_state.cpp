@@ -37,7 +37,10 @@ constexpr name_value LINK_SETTINGS[] = {{"rp_filter", "0"},
 constexpr name_value L2_SETTINGS[] = {{"accept_local", "1"}, {"send_redirects", "0"}, {"forwarding", "1"}};
 
 // Link numbers by ends.
-using link_numbers = std::map<tunnel_ends, uint32_t>;
+using numbers_by_ends = std::map<tunnel_ends, uint32_t>;
+struct link_numbers {
+    numbers_by_ends carrying, passing;
+};
 
 bool stands_beside(const accepted_source &source, const tunnel_ends &tunnel) {
     return !source.router || source.router == tunnel.remote;
@@ -52,39 +55,28 @@ std::vector<lingering_tunnel> all_tunnels(const appliance_view &view) {
     return out;
 }
 
-std::vector<link_wish> wish_links(const appliance_view &view) {
-    std::vector<link_wish> wishes;
-    std::set<tunnel_ends> taken;
-    const auto tunnels = all_tunnels(view);
-    for (const auto &[id, ends] : tunnels)
-        if (taken.insert(ends).second)
-            wishes.push_back({id, ends.local, ends.remote, false});
-    for (const auto &source : view.accepted)
-        for (const auto &[id, ends] : tunnels)
-            if (source.address && stands_beside(source, ends) &&
-                taken.insert({ends.local, source.address}).second)
-                wishes.push_back({id, ends.local, source.address, true});
-    return wishes;
+numbers_by_ends &numbers_of(link_numbers *numbers, const link_wish &wish) {
+    return wish.kind == link_kind::passing ? numbers->passing : numbers->carrying;
 }
 
 // Known ends keep their number. The number of a link that goes is free only once it has gone.
 link_numbers number_links(const std::vector<link_wish> &wishes, const std::vector<wanted_link> &before) {
-    link_numbers old;
+    link_numbers old, numbers;
     std::set<uint32_t> used;
     for (const auto &link : before) {
         const auto number = link_number(link.name);
         if (number && used.insert(*number).second)
-            old.insert({{link.wish.local, link.wish.remote}, *number});
+            numbers_of(&old, link.wish).insert({{link.wish.local, link.wish.remote}, *number});
     }
-    link_numbers numbers;
     uint32_t next = 0;
     for (const auto &wish : wishes) {
         const tunnel_ends ends = {wish.local, wish.remote};
-        const auto known = old.find(ends);
-        if (known == old.end())
+        const numbers_by_ends &before_by_ends = numbers_of(&old, wish);
+        const auto known = before_by_ends.find(ends);
+        if (known == before_by_ends.end())
             while (!used.insert(next).second)
                 next++;
-        numbers[ends] = known == old.end() ? next : known->second;
+        numbers_of(&numbers, wish)[ends] = known == before_by_ends.end() ? next : known->second;
     }
     return numbers;
 }
@@ -99,25 +91,100 @@ bool carries_group(const tunnel_ends &tunnel, const group_view &group) {
                        [&](const group_router &router) { return router.id == tunnel.remote; });
 }
 
+bool redirects_by_l2(const group_view &group) {
+    return is_interface_name(group.interface) &&
+           std::any_of(group.routers.begin(), group.routers.end(),
+                       [](const group_router &router) { return router.forward == travel::l2; });
+}
+
+bool has_tunnel(const appliance_view &view, const group_view &group) {
+    const auto tunnels = all_tunnels(view);
+    return std::any_of(tunnels.begin(), tunnels.end(),
+                       [&](const lingering_tunnel &each) { return carries_group(each.ends, group); });
+}
+
+bool is_tunnel(const appliance_view &view, const tunnel_ends &ends) {
+    const auto tunnels = all_tunnels(view);
+    return std::any_of(tunnels.begin(), tunnels.end(),
+                       [&](const lingering_tunnel &each) { return each.ends == ends; });
+}
+
+// The ends of links to other appliances: of groups whose packets come here, while something is intercepted.
+// One that is a router as well is none. What such links bring is never passed on; therefore they come before
+// sources that are accepted as if they were routers.
+std::set<tunnel_ends> member_ends(const appliance_view &view) {
+    std::set<tunnel_ends> all;
+    for (const auto &[id, protection] : view.protections) {
+        const auto group = view.groups.find(id);
+        if (view.intercepts.empty() || group == view.groups.end() || !group->second.local ||
+            (!redirects_by_l2(group->second) && !has_tunnel(view, group->second)))
+            continue;
+        for (const uint32_t member : protection.members)
+            if (!is_tunnel(view, {group->second.local, member}))
+                all.insert({group->second.local, member});
+    }
+    return all;
+}
+
+// Buckets are seen by the user-space plane alone, in what comes through tunnels.
+std::set<tunnel_ends> passing_ends(const appliance_view &view) {
+    std::set<tunnel_ends> all;
+    const std::set<tunnel_ends> members = member_ends(view);
+    for (const auto &[id, protection] : view.protections)
+        if (const auto group = view.groups.find(id);
+            !protection.by_mask && group != view.groups.end() && has_tunnel(view, group->second))
+            for (const uint32_t member : protection.members)
+                if (members.contains({group->second.local, member}))
+                    all.insert({group->second.local, member});
+    return all;
+}
+
+std::vector<link_wish> wish_links(const appliance_view &view, bool user_space) {
+    std::vector<link_wish> wishes;
+    const auto tunnels = all_tunnels(view);
+    std::set<tunnel_ends> taken = member_ends(view);
+    for (const auto &[id, ends] : tunnels)
+        if (taken.insert(ends).second)
+            wishes.push_back({id, ends.local, ends.remote, link_kind::tunnel});
+    for (const auto &source : view.accepted)
+        for (const auto &[id, ends] : tunnels)
+            if (source.address && stands_beside(source, ends) &&
+                taken.insert({ends.local, source.address}).second)
+                wishes.push_back({id, ends.local, source.address, link_kind::accepted});
+    for (const tunnel_ends &ends : member_ends(view))
+        wishes.push_back({0, ends.local, ends.remote, link_kind::member});
+    if (user_space)
+        for (const tunnel_ends &ends : passing_ends(view))
+            wishes.push_back({0, ends.local, ends.remote, link_kind::passing});
+    return wishes;
+}
+
+// Those that an earlier tunneld has left.
+void keep_members(const std::vector<wanted_link> &left, std::vector<link_wish> *inout) {
+    for (const wanted_link &link : left)
+        if ((link.wish.kind == link_kind::member || link.wish.kind == link_kind::passing) &&
+            std::none_of(inout->begin(), inout->end(), [&](const link_wish &wish) {
+                return wish.local == link.wish.local && wish.remote == link.wish.remote &&
+                       (wish.kind == link_kind::passing) == (link.wish.kind == link_kind::passing);
+            }))
+            inout->push_back(link.wish);
+}
+
 // The ends of a group's links and, for each, the tunnel that they stand beside or are.
 std::map<tunnel_ends, tunnel_ends> group_links(const appliance_view &view, const group_view &group,
                                                const std::vector<lingering_tunnel> &tunnels) {
     std::map<tunnel_ends, tunnel_ends> links;
+    const std::set<tunnel_ends> members = member_ends(view);
     for (const auto &[id, tunnel] : tunnels) {
         if (!carries_group(tunnel, group))
             continue;
         links[tunnel] = tunnel;
         for (const auto &source : view.accepted)
-            if (source.address && stands_beside(source, tunnel))
+            if (source.address && stands_beside(source, tunnel) &&
+                !members.contains({tunnel.local, source.address}))
                 links.insert({{tunnel.local, source.address}, tunnel});
     }
     return links;
-}
-
-bool redirects_by_l2(const group_view &group) {
-    return is_interface_name(group.interface) &&
-           std::any_of(group.routers.begin(), group.routers.end(),
-                       [](const group_router &router) { return router.forward == travel::l2; });
 }
 
 struct next_hop {
@@ -146,11 +213,18 @@ void choose_return(const group_view &group, uint32_t router_id, l2_choice *choic
     }
 }
 
+// What is not to be delivered here goes where `table` says.
+void want_link_basics(const wanted_link &link, uint32_t table, wanted_state *out) {
+    out->rules.push_back({PREFER_LOCAL, link.name, MARK_LOCAL, TABLE_LOCAL});
+    out->rules.push_back({PREFER_LINK, link.name, 0, table});
+    for (const auto &[name, value] : LINK_SETTINGS)
+        out->settings.push_back({link.name + "/" + name, value, false});
+}
+
 void want_link(const wanted_link &link, uint32_t number, const l2_choice &choice, wanted_state *out) {
     const uint32_t table = TABLE_LINK_FIRST + number;
-    out->rules.push_back({PREFER_LOCAL, link.name, MARK_LOCAL, TABLE_LOCAL});
+    want_link_basics(link, table, out);
     out->rules.push_back({PREFER_FORWARD, link.name, MARK_FORWARD, RT_TABLE_MAIN});
-    out->rules.push_back({PREFER_LINK, link.name, 0, table});
     wanted_route route = {table, false, link.name, 0};
     if (choice.forced || (choice.agreed && !choice.gre)) {
         const next_hop &hop = choice.forced ? *choice.forced : *choice.agreed;
@@ -158,8 +232,6 @@ void want_link(const wanted_link &link, uint32_t number, const l2_choice &choice
         route.via = hop.via;
     }
     out->routes.push_back(route);
-    for (const auto &[name, value] : LINK_SETTINGS)
-        out->settings.push_back({link.name + "/" + name, value, false});
     out->sorting.links.push_back(link.name);
     out->sorting.ends.push_back({link.wish.local, link.wish.remote});
     out->sorting.mss = TUNNEL_MSS;
@@ -171,7 +243,7 @@ std::optional<uint32_t> l2_return_link(const group_view &group, const link_numbe
         return std::nullopt;
     for (const auto &router : group.routers)
         if (router.forward == travel::l2 && router.give_back == travel::gre)
-            for (const auto &[ends, number] : numbers)
+            for (const auto &[ends, number] : numbers.carrying)
                 if (ends.remote == router.id && (!group.local || group.local == ends.local))
                     return number;
     return std::nullopt;
@@ -206,10 +278,44 @@ std::vector<std::string> group_interfaces(const appliance_view &view, const grou
     for (const auto &[id, ends] : view.tunnels)
         tunnels.push_back({id, ends});
     for (const auto &[ends, tunnel] : group_links(view, group, tunnels))
-        names.push_back(link_name(numbers.at(ends)));
+        names.push_back(link_name(numbers.carrying.at(ends)));
     if (redirects_by_l2(group))
         names.push_back(group.interface);
     return names;
+}
+
+// The ports of TCP whose flows are protected in a group: those of its intercept or, where it has none, as the
+// ports of the sender those of all intercepts. False: nothing is. None: all ports.
+bool protected_ports(const appliance_view &view, uint8_t id, bool *out_by_source,
+                     std::vector<port_range> *out) {
+    const auto own = view.intercepts.find(id);
+    *out_by_source = own == view.intercepts.end();
+    bool any = false, all = false;
+    for (const auto &[group, rules] : view.intercepts) {
+        if ((group != id && !*out_by_source) || rules.protocol != 6)
+            continue;
+        any = true;
+        all |= rules.ports.empty();
+        out->insert(out->end(), rules.ports.begin(), rules.ports.end());
+    }
+    if (all)
+        out->clear();
+    return any;
+}
+
+// By mask; only where a slot is somebody's.
+void want_pass_marks(const appliance_view &view, const link_numbers &numbers, sorted_group *inout) {
+    const auto protection = view.protections.find(inout->group);
+    bool by_source = false;
+    if (protection == view.protections.end() || !protection->second.by_mask ||
+        !protected_ports(view, inout->group, &by_source, &inout->pass_ports))
+        return;
+    const std::set<tunnel_ends> members = member_ends(view);
+    const uint32_t local = view.groups.at(inout->group).local;
+    inout->mask = protection->second.mask;
+    for (const uint32_t target : protection->second.targets)
+        inout->pass_marks.push_back(
+            members.contains({local, target}) ? MARK_PASS + numbers.carrying.at({local, target}) : 0);
 }
 
 // Groups with an intercept, and those that share an interface with one: without a wish of their own, they
@@ -225,35 +331,117 @@ void want_groups(const appliance_view &view, const link_numbers &numbers, std::v
             continue;
         }
         const auto condition = view.conditions.find(id);
-        out->push_back({id, rules->second,
-                        condition == view.conditions.end() ? intercept_condition{} : condition->second,
-                        names});
+        sorted_group made = {id, rules->second,
+                             condition == view.conditions.end() ? intercept_condition{} : condition->second,
+                             names};
+        want_pass_marks(view, numbers, &made);
+        out->push_back(std::move(made));
         intercepted.insert(names.begin(), names.end());
     }
-    for (const auto &[id, names] : others)
-        if (std::any_of(names.begin(), names.end(),
-                        [&](const std::string &name) { return intercepted.count(name) > 0; }))
-            out->push_back({id, {}, {}, names});
+    for (const auto &[id, names] : others) {
+        sorted_group made = {id, {}, {}, names};
+        want_pass_marks(view, numbers, &made);
+        if (!made.pass_marks.empty() || std::any_of(names.begin(), names.end(), [&](const std::string &name) {
+                return intercepted.count(name) > 0;
+            }))
+            out->push_back(std::move(made));
+    }
+}
+
+// Packets of other appliances that nobody here wants go back to a router of a group that has both.
+std::optional<wanted_route> member_return(const appliance_view &view, const link_numbers &numbers,
+                                          const tunnel_ends &member, const wanted_state &made) {
+    const auto route_of = [&](uint32_t number) -> std::optional<wanted_route> {
+        for (const wanted_route &route : made.routes)
+            if (route.table == TABLE_LINK_FIRST + number)
+                return route;
+        return std::nullopt;
+    };
+    for (const auto &[id, protection] : view.protections) {
+        const auto group = view.groups.find(id);
+        if (group == view.groups.end() || group->second.local != member.local ||
+            std::find(protection.members.begin(), protection.members.end(), member.remote) ==
+                protection.members.end())
+            continue;
+        if (const auto number = l2_return_link(group->second, numbers))
+            return route_of(*number);
+        for (const auto &router : group->second.routers)
+            if (router.forward == travel::l2 && router.address && is_interface_name(group->second.interface))
+                return wanted_route{0, false, group->second.interface, router.address};
+        for (const auto &[ends, tunnel] : group_links(view, group->second, all_tunnels(view)))
+            if (ends == tunnel)
+                return route_of(numbers.carrying.at(ends));
+    }
+    return std::nullopt;
+}
+
+void want_members(const appliance_view &view, const link_numbers &numbers, wanted_state *out) {
+    for (size_t i = 0; i < out->links.size(); i++) {
+        const wanted_link &link = out->links[i];
+        const tunnel_ends ends = {link.wish.local, link.wish.remote};
+        if (link.wish.kind != link_kind::member && link.wish.kind != link_kind::passing)
+            continue;
+        const auto number = numbers.carrying.find(ends);
+        if (number == numbers.carrying.end())
+            continue;
+        const uint32_t table = TABLE_PASS_FIRST + number->second;
+        if (link.wish.kind == link_kind::passing) {
+            want_link_basics(link, table, out);
+            out->sorting.passing.push_back(link.name);
+            continue;
+        }
+        want_link_basics(link, TABLE_LINK_FIRST + number->second, out);
+        out->rules.push_back({PREFER_RETURN, "", MARK_PASS + number->second, table});
+        out->routes.push_back({table, false, link.name, 0});
+        if (auto route = member_return(view, numbers, ends, *out)) {
+            route->table = TABLE_LINK_FIRST + number->second;
+            out->routes.push_back(*route);
+        }
+        out->sorting.members.push_back(link.name);
+        out->sorting.ends.push_back(ends);
+    }
+}
+
+// What the user-space plane passes on: of groups with an intercept what that wants, and of the others, whose
+// packets go the other way, what comes from there.
+void want_passing(const appliance_view &view, const link_numbers &numbers, wanted_state *out) {
+    for (const auto &[id, protection] : view.protections) {
+        const auto group = view.groups.find(id);
+        if (protection.by_mask || group == view.groups.end())
+            continue;
+        passing_group made;
+        made.local = group->second.local;
+        if (!protected_ports(view, id, &made.by_source_port, &made.ports))
+            continue;
+        for (const uint32_t target : protection.targets)
+            made.members.push_back(numbers.passing.contains({made.local, target}) ? target : 0);
+        if (std::any_of(made.members.begin(), made.members.end(), [](uint32_t one) { return one != 0; }))
+            out->passing[id] = std::move(made);
+    }
 }
 
 } // namespace
 
 wanted_state make_wanted_state(const appliance_view &view, const std::vector<wanted_link> &before,
-                               bool user_space) {
+                               bool user_space, bool kept) {
     wanted_state wanted;
-    const auto wishes = wish_links(view);
-    const auto numbers = number_links(wishes, before);
+    auto wishes = wish_links(view, user_space);
+    if (kept)
+        keep_members(before, &wishes);
+    link_numbers numbers = number_links(wishes, before);
     std::map<tunnel_ends, l2_choice> choices;
     for (const auto &[id, group] : view.groups)
         for (const auto &[ends, tunnel] : group_links(view, group, all_tunnels(view)))
             choose_return(group, tunnel.remote, &choices[ends]);
     std::map<uint32_t, link_wish> by_number;
     for (const auto &wish : wishes)
-        by_number[numbers.at({wish.local, wish.remote})] = wish;
+        by_number[numbers_of(&numbers, wish).at({wish.local, wish.remote})] = wish;
     for (const auto &[number, wish] : by_number) {
         wanted.links.push_back({link_name(number), wish});
-        want_link(wanted.links.back(), number, choices[{wish.local, wish.remote}], &wanted);
+        if (wish.kind == link_kind::tunnel || wish.kind == link_kind::accepted)
+            want_link(wanted.links.back(), number, choices[{wish.local, wish.remote}], &wanted);
     }
+    want_members(view, numbers, &wanted);
     want_l2_interfaces(view, numbers, &wanted);
     if (!wanted.rules.empty()) {
         wanted.routes.insert(wanted.routes.begin(), {TABLE_LOCAL, true, "", 0});
@@ -265,6 +453,8 @@ wanted_state make_wanted_state(const appliance_view &view, const std::vector<wan
     }
     std::sort(wanted.rules.begin(), wanted.rules.end());
     want_groups(view, numbers, &wanted.sorting.groups);
+    if (user_space)
+        want_passing(view, numbers, &wanted);
     for (const auto &entry : view.bypasses)
         wanted.sorting.bypasses.push_back(entry.prefix);
     wanted.sorting.own_addresses = view.own_addresses;
