@@ -104,8 +104,17 @@ std::set<std::string> describe(const wanted_state &wanted) {
         std::string line = "group " + std::to_string(group.group);
         for (const auto &name : group.interfaces)
             line += " " + name;
+        for (const uint32_t mark : group.pass_marks)
+            line += mark ? " " + std::to_string(mark - MARK_PASS) : " -";
         lines.insert(line + (group.rules.to ? "" : " unwanted"));
     }
+    for (const auto &name : sorting.members)
+        lines.insert("member " + name);
+    for (const auto &name : sorting.passing)
+        lines.insert("passing " + name);
+    for (const auto &[id, group] : wanted.passing)
+        lines.insert("bucket 9 of " + std::to_string(id) + " to " + address_text(group.members[9]) +
+                     (group.by_source_port ? " by source" : ""));
     lines.insert("mss " + std::to_string(sorting.mss) + (sorting.drop_outer_gre ? " outer dropped" : ""));
     return lines;
 }
@@ -115,6 +124,16 @@ struct wanted_case {
     std::function<void(appliance_view *)> change; // of two tunnels to two routers, and a group of the first
     std::vector<std::string> present, absent;
 };
+
+// Group 61 shares its flows with OTHER; 62 brings the answers.
+void protect(appliance_view *view, bool by_mask) {
+    view->groups[62] = view->groups[61];
+    for (const uint8_t id : {uint8_t{61}, uint8_t{62}}) {
+        view->protections[id] = {by_mask, {1, 0, 0, 0}, {OTHER, R1}, {0, OTHER}};
+        if (!by_mask)
+            view->protections[id].targets.assign(256, OTHER);
+    }
+}
 
 const wanted_case wanted_cases[] = {
     {"a group with its router's tunnel; the other is carried as well",
@@ -190,6 +209,37 @@ const wanted_case wanted_cases[] = {
      {"l2 eth0", "l2 eth0 into 1", "rule 2 eth0 57430101 204802", "group 61 wccp1 eth0",
       "route 204802 wccp1"},
      {}},
+    {"another appliance, by mask: a link, which no source that is accepted takes",
+     [](appliance_view *view) {
+         protect(view, true);
+         view->accepted = {{OTHER, 0}};
+     },
+     {"link wccp2 tunneld 0 10.0.0.101 10.0.0.9 member", "member wccp2", "group 61 wccp0 - 2",
+      "group 62 wccp0 - 2 unwanted", "rule 2  57450002 270339", "route 270339 wccp2", "route 204803 wccp0",
+      "rule 0 wccp2 57430001 204800", "rule 3 wccp2 0 204803", "ends 10.0.0.101 10.0.0.9"},
+     {"rule 1 wccp2 57430002 254", "passing wccp3", "bucket 9 of 61 to 10.0.0.9"}},
+    {"another appliance, by bucket, with an interface for what is its own",
+     [](appliance_view *view) { protect(view, false); },
+     {"link wccp3 tunneld 0 10.0.0.101 10.0.0.9 passing", "passing wccp3", "rule 3 wccp3 0 270339",
+      "bucket 9 of 61 to 10.0.0.9", "bucket 9 of 62 to 10.0.0.9 by source", "group 61 wccp0"},
+     {"ends 10.0.0.101 10.0.0.2 passing", "member wccp3"}},
+    {"another appliance, by L2",
+     [](appliance_view *view) {
+         protect(view, true);
+         view->tunnels.clear();
+         for (auto &[id, group] : view->groups)
+             group.routers[0].forward = group.routers[0].give_back = travel::l2;
+     },
+     {"link wccp0 tunneld 0 10.0.0.101 10.0.0.1 member", "route 204801 eth0 via 10.0.0.17",
+      "route 270337 wccp0", "group 61 eth0 - 1"},
+     {}},
+    {"nothing is intercepted",
+     [](appliance_view *view) {
+         protect(view, true);
+         view->intercepts.clear();
+     },
+     {},
+     {"member wccp2"}},
     {"no interface by a name that leads out of its directory",
      [](appliance_view *view) {
          view->groups[61] = {"../../x", LOCAL, 0, true, {{R1, R1, travel::l2, travel::gre}}};
@@ -226,7 +276,11 @@ TEST(wanted_state, links_keep_their_numbers) {
 TEST(link_names, only_ours_are_read) {
     const link_wish wish = {65535, LOCAL, R1, link_kind::accepted};
     EXPECT_EQ(link_alias(wish), "tunneld 65535 10.0.0.101 10.0.0.1 accepted");
-    EXPECT_EQ(parse_link_alias(link_alias(wish)), wish);
+    for (const link_kind kind :
+         {link_kind::tunnel, link_kind::accepted, link_kind::member, link_kind::passing}) {
+        const link_wish each = {3, LOCAL, R1, kind};
+        EXPECT_EQ(parse_link_alias(link_alias(each)), each);
+    }
     for (const std::string alias :
          {"", "tunneld", "tunneld 3 10.0.0.101", "tunneld 65536 10.0.0.101 10.0.0.1",
           "tunneld 03 10.0.0.101 10.0.0.1", "tunneld 3 10.0.0.101 10.0.0.1 ",

@@ -100,8 +100,9 @@ std::string make_bytes(const packet &what) {
     return ip_packet(what.source, what.destination, what.protocol, body);
 }
 
-enum device { LINK, LAN, OUT, DEVICES };
-constexpr const char *device_names[DEVICES] = {"wccp0", "lan0", "out0"};
+enum device { LINK, LAN, OUT, MEMBER, DEVICES };
+constexpr const char *device_names[DEVICES] = {"wccp0", "lan0", "out0", "wccp9"};
+constexpr uint32_t PASSED_ON = MARK_PASS + 9;
 int devices[DEVICES];
 uint16_t next_port = 20000;
 
@@ -165,6 +166,7 @@ wanted_sorting make_wanted() {
     wanted_sorting wanted;
     wanted.links = {"wccp0"};
     wanted.l2_interfaces = {"lan0"};
+    wanted.members = {"wccp9"};
     wanted.groups = {make_group(5, 6, {{80, 80}, {8000, 8080}}), make_group(6, 17, {{53, 53}}),
                      make_group(7, 6, {{8040, 8100}})}; // in part taken by group 5
     wanted.groups[0].interfaces = {"wccp0", "lan0"};
@@ -183,14 +185,17 @@ struct Sorting : testing::Test {
         ASSERT_EQ(
             system(
                 "set -e; cd /proc/sys/net/ipv4/conf; echo 0 >all/rp_filter; ip addr add 10.0.0.1/32 dev lo\n"
-                "for d in wccp0 lan0 out0; do echo 1 >$d/forwarding; echo 0 >$d/rp_filter\n"
+                "for d in wccp0 lan0 out0 wccp9; do echo 1 >$d/forwarding; echo 0 >$d/rp_filter\n"
                 "    echo 1 >$d/accept_local; ip link set $d up; done\n"
                 "ip route add default dev out0; ip route add local default dev lo table 204800\n"
                 "ip route add default dev wccp0 table 204801\n"
                 "ip rule add pref 2048 fwmark 0x57430001 lookup 204800\n"
                 "ip rule add pref 2049 fwmark 0x57430002 lookup main\n"
                 "ip rule add pref 2050 fwmark 0x57430100 lookup 204801\n"
-                "ip rule add pref 2051 iif wccp0 lookup 204801"),
+                "ip route add default dev wccp9 table 270346\n"
+                "ip rule add pref 2050 fwmark 0x57450009 lookup 270346\n"
+                "ip rule add pref 2051 iif wccp0 lookup 204801\n"
+                "ip rule add pref 2051 iif wccp9 lookup 204801"),
             0);
         listen_on(SOCK_STREAM, INADDR_ANY, 3128);
         listen_on(SOCK_STREAM, INADDR_LOOPBACK, 3129);
@@ -242,6 +247,17 @@ int Sorting::udp;
 
 TEST_F(Sorting, PacketsGoWhereTheyShould) {
     using W = wanted_sorting;
+    static const auto pass_group_5 = [](W &w) {
+        w.groups[0].mask = {7, 0, 0, 0};
+        w.groups[0].pass_marks.assign(8, 0);
+        w.groups[0].pass_marks[CLIENT & 7] = PASSED_ON;
+    };
+    static const auto pass_answers = [](W &w) {
+        w.groups[1].rules = {};
+        w.groups[1].mask = {0, 4, 0, 0};
+        w.groups[1].pass_ports = {{79, 80}, {80, 81}};
+        w.groups[1].pass_marks = {0, PASSED_ON};
+    };
     static const struct {
         const char *what;
         std::function<void(W &)> change;
@@ -363,6 +379,65 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
          "out0",
          SORTED_RETURNED,
          0},
+        {"another appliance's flow", pass_group_5, {.flags = ACK}, LINK, "wccp9", SORTED_PASSED, 5},
+        {"the same by L2", pass_group_5, {.flags = ACK}, LAN, "wccp9", SORTED_PASSED, 5},
+        {"of another slot",
+         pass_group_5,
+         {.source = CLIENT + 1, .flags = ACK},
+         LINK,
+         "wccp0",
+         SORTED_RETURNED,
+         5},
+        {"a new flow in that slot", pass_group_5, {}, LINK, "answer", SORTED_TO_PROXY, 5},
+        {"passed on to this appliance, which would pass it on",
+         pass_group_5,
+         {.flags = ACK},
+         MEMBER,
+         "wccp0",
+         SORTED_RETURNED,
+         0},
+        {"the plane's choice, without a socket",
+         [](W &w) {
+             pass_group_5(w);
+             w.members.swap(w.passing);
+         },
+         {.flags = ACK},
+         MEMBER,
+         "wccp0",
+         SORTED_PASSED,
+         0},
+        {"by all four fields", // 80, the source port, 4 and 1: the bits of slot 15
+         [](W &w) {
+             w.groups[0].mask = {1, 4, 0x8000, 16};
+             w.groups[0].pass_marks.assign(16, 0);
+             w.groups[0].pass_marks[15] = PASSED_ON;
+         },
+         {.flags = ACK, .from = 40000},
+         LINK,
+         "wccp9",
+         SORTED_PASSED,
+         5},
+        {"one slot for all",
+         [](W &w) { w.groups[0].pass_marks = {PASSED_ON}; },
+         {.flags = ACK},
+         LINK,
+         "wccp9",
+         SORTED_PASSED,
+         5},
+        {"an answer",
+         pass_answers,
+         {.flags = ACK, .port = 50000, .from = 81},
+         LINK,
+         "wccp9",
+         SORTED_PASSED,
+         6},
+        {"not of a wanted port",
+         pass_answers,
+         {.flags = ACK, .port = 50000, .from = 82},
+         LINK,
+         "wccp0",
+         SORTED_RETURNED,
+         0},
         {"no groups", [](W &w) { w.groups.clear(); }, {}, LINK, "wccp0", SORTED_RETURNED, 0},
     };
     for (const auto &row : rows) {
@@ -400,17 +475,19 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
     // Its other packets need no rule of a group.
     wanted.groups[0].condition.proxy_up = false;
     wanted.bypasses = {{0, 0}};
+    wanted.groups[0].pass_marks = {PASSED_ON};
     apply(wanted);
     next.flags = ACK;
     next.sequence = 2;
     next.acknowledged = get(answer, 24, 4) + 1;
-    EXPECT_EQ(send(next), "");
+    EXPECT_EQ(send(next, MEMBER), ""); // from another appliance
+    EXPECT_EQ(counters().interfaces["wccp9"][SORTED_TO_PROXY].packets, 1);
     next.text = "hello";
     EXPECT_EQ(send(next), "refused"); // acknowledged
     const int flow = accept(listener, nullptr, nullptr);
     char buffer[16];
     EXPECT_EQ(recv(flow, buffer, sizeof(buffer), 0), 5);
-    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_TO_PROXY].packets, 3);
+    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_TO_PROXY].packets, 2);
     // The proxy closes first, and what remains of the flow is no whole socket: the client's FIN belongs to
     // it. A next flow from the same port is the proxy's again, or is told that the old one isn't over.
     close(flow);
@@ -419,7 +496,7 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
     next.text = "";
     next.flags = FIN | ACK;
     send(next);
-    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_TO_PROXY].packets, 4);
+    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_TO_PROXY].packets, 3);
     next.flags = SYN;
     next.sequence += 100000;
     EXPECT_EQ(send(next), "refused");
