@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <fstream>
 #include <functional>
 #include <map>
 #include <sstream>
@@ -13,6 +14,7 @@
 #include "peers/mgmtctl/intercepts.h"
 #include "peers/mgmtctl/show_draw.h"
 #include "peers/mgmtctl/show_gather.h"
+#include "peers/mgmtctl/show_json.h"
 #include "peers/mgmtctl/show_texts.h"
 #include "runtime/common.h"
 
@@ -74,7 +76,8 @@ canned one_group() {
     static const char *const lines =
         "C 51|C/interface eth0|C/weight 25|C/password secret|C/protocol tcp|"
         "C/router/1/ipaddr 10.0.0.1|C/router/2/ipaddr 10.0.0.2|C/router/3/ipaddr 10.0.0.3|"
-        "S 51|S/oper ACTIVE, DESIGNATED|S/uptime 3723000|S/app_id 10.0.0.101|"
+        "S 51|S/oper ACTIVE, DESIGNATED|S/uptime 3723000|S/app_id 10.0.0.101|S/since 70000|"
+        "S/counter/tx_here_i_am 7|"
         "S/num_appliances 2|R1 10.0.0.2 ONE 20|R2 10.0.0.1 TWO 25|"
         "S/appliance/1/ipaddr 10.0.0.101|S/appliance/1/weight 25|"
         "S/appliance/2/ipaddr 10.0.0.102|S/appliance/2/weight 75|";
@@ -183,8 +186,11 @@ TEST(Show, TellsTheWholeOfAGroup) {
 
     const std::string screen = joined(draw_screen(shown, {80, 23, false, false, ""}));
     for (const char *text :
-         {"wccpd Ready (1.0.0)   1 group: 1 active   1 alarm\n! group 51: a router is not connected as it "
-          "should be, since 2026/11/25 00:10:11\n",
+         {"wccpd Ready (1.0.0)   1 group: 1 active   1 alarm\n! group 51: 10.0.0.3 does not answer (7 "
+          "Here-I-Am "
+          "sent), since 2026/11/25 00:10:",
+          "\n  10.0.0.3 does not answer (7 Here-I-Am sent), for 0:01:10\n"
+          "  > check address, service group, password and path (UDP 2048) on the router\n",
           "51  ACTIVE, designated !  up 1:02:03  10.0.0.101 on eth0  tcp  weight 25  md5\n",
           "  router 10.0.0.1        two-way   0:01:00  fwd gre  assign -     return l2",
           "  router 10.0.0.3        nothing heard\n",
@@ -232,7 +238,7 @@ TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
     };
     snapshot_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
     std::vector<std::string> lines = draw_screen(gather_snapshot(query, limits), {79, 23, true, true, ""});
-    EXPECT_LE(asked, 12u + 23u * 6);
+    EXPECT_LE(asked, 13u + 23u * 7);
     ASSERT_EQ(lines.size(), 23u);
     EXPECT_NE(lines[1].find("routers 31/31  share 3%"), std::string::npos) << lines[1];
     EXPECT_NE(lines.back().find("and 235 groups not shown"), std::string::npos) << lines.back();
@@ -253,6 +259,127 @@ TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
     }
     EXPECT_NE(joined(draw_screen(detailed, {79, 60, false, false, ""})).find("and 30 routers more"),
               std::string::npos);
+}
+
+// --- Reasons
+
+static int explained(const snapshot &shown, int group, std::string *out, bool as_json = false) {
+    ctl_options options;
+    options.json = as_json;
+    testing::internal::CaptureStdout();
+    const int exit = tell_reasons(options, shown, group);
+    fflush(stdout);
+    *out = testing::internal::GetCapturedStdout();
+    return exit;
+}
+
+// Each row breaks a group that works, or changes it; wccpd's reasons are CODE SENDER OFFERED/WANTED.
+TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
+    const struct {
+        const char *name, *value; // of a node that is set; "S/reason" for a reason, "" for nothing
+        const char *said;         // by explain, all of the first reason
+        int exit = 1;
+        const char *screen = "";
+    } rows[] = {
+        {"", "", "group 51  ACTIVE, designated\n  nothing needs attention\n", 0},
+        {"S/reason", "password-mismatch 10.0.0.1 /",
+         "  password-mismatch: 10.0.0.1 signs its messages with another password\n"
+         "    4 times, first 0:01:10 ago, last 0:00:03 ago\n"
+         "    next: set the same one on both: mgmtctl group set 51 password -\n",
+         1, "51  ACTIVE, designated !"},
+        {"S/reason", "service-mismatch 10.0.0.1 priority 7/priority 200",
+         "10.0.0.1 has the service with priority 7; here it is priority 200"},
+        {"S/reason", "interface-missing 0.0.0.0 /eth9", "there is no interface eth9\n", 1,
+         "51  ACTIVE, designated, no interface !"},
+        {"S/reason", "election-blocked 10.0.0.9 no I-See-You/two-way", "a router lists 10.0.0.9", 1,
+         "  no appliance can be designated: a router lists 10.0.0.9, which is here: no\n"
+         "    I-See-You, 4 times, first 0:01:10 ago, last 0:00:03 ago\n"},
+        {"S/reason", "query-refused 10.0.0.1 a query/", "  nothing needs attention\n  query-refused: ", 0},
+        {"S/reason", "method-differs 10.0.0.1 hash by the router/mask", "assignment is hash by the router"},
+        {"S/reason", "not-known-here 10.0.0.1 /", "  not-known-here: not-known-here of 10.0.0.1\n"},
+        {"S/oper", "BACKUP", "redirected-elsewhere: the routers redirect to others: 10.0.0.102 75%"},
+        {"S/oper", "INIT", "waiting-assignment: the routers answer; no table is in force yet (10.0.0.101 is"},
+        {"C/encap", "l2", "restart-needed: the group runs with forwarding by gre, but is configured with l2"},
+        {"C/admin", "down", "  nothing needs attention\n  disabled: the group is disabled\n", 0},
+        {"C/router/4/ipaddr", "10.0.0.4", "10.0.0.4 does not answer (7 Here-I-Am sent)\n    for 0:01:10\n"},
+    };
+    for (const auto &row : rows) {
+        SCOPED_TRACE(row.value);
+        canned from = one_group();
+        std::erase_if(from.nodes, [&](const ctl_binding &node) {
+            return node.name.ends_with("/router/3/ipaddr") ||
+                   (*row.name && node.name == STATE + "51" + (row.name + 1)) ||
+                   (*row.screen != '!' && node.name.starts_with(ALARM));
+        });
+        const std::string root = (*row.name == 'C' ? CONFIG : STATE) + "51" + (row.name + !!*row.name);
+        if (row.name == std::string("S/reason")) {
+            char code[32] = "", sender[32] = "", offered[32] = "", wanted[32] = "";
+            sscanf(row.value, "%31s %31s %31[^/]/%31[^\n]", code, sender, offered, wanted);
+            if (const char *slash = strchr(row.value, '/'); slash)
+                snprintf(wanted, sizeof wanted, "%s", slash + 1);
+            const std::pair<const char *, const char *> nodes[] = {
+                {"code", code}, {"sender", sender}, {"offered", offered}, {"wanted", wanted},
+                {"count", "4"}, {"first", "70000"}, {"last", "3000"}};
+            for (const auto &[node, value] : nodes)
+                from.add(root + "/3/" + node, value);
+        } else if (*row.name) {
+            from.add(root, row.value);
+        }
+        from.add(NODE_PLANE_STATE "/name", "table");
+        const snapshot shown = from.gather();
+        std::string text;
+        EXPECT_EQ(explained(shown, 51, &text), row.exit);
+        EXPECT_NE(text.find(row.said), std::string::npos) << text;
+        const std::string screen = joined(draw_screen(shown, {80, 0, false, false, ""}));
+        EXPECT_NE(screen.find(row.screen), std::string::npos) << screen;
+        const bool misread = strstr(row.value, "by the router") != nullptr;
+        EXPECT_EQ(json::parse(draw_json(shown))["groups"][0]["tables"][0]["routers"].size(),
+                  misread ? 1u : 2u);
+        EXPECT_EQ(explained(shown, -1, &text, true), row.exit);
+        for (const json &each : json::parse(text)["reasons"])
+            EXPECT_TRUE(each["cause"] != "" && each["next"] != "") << each;
+    }
+}
+
+TEST(Show, WhatIsNotKnownIsNotSaid) {
+    canned from = one_group();
+    std::erase_if(from.nodes, [](const ctl_binding &node) { return node.name.starts_with(ALARM); });
+    std::string text;
+    for (const auto &[code, word] :
+         std::map<uint32_t, std::string>{{LC_IO_CLOSED, "absent"}, {LC_IO_TIMED_OUT, "silent"}}) {
+        from.wccpd_code = code;
+        const snapshot shown = from.gather();
+        EXPECT_EQ(joined(draw_screen(shown, {80, 0, false, false, ""})).find("no alarm"), std::string::npos);
+        const json all = json::parse(draw_json(shown));
+        EXPECT_TRUE(all["alarms_total"].is_null() && all["groups"][0]["state"].is_null());
+        EXPECT_EQ(all["reasons"][0]["reason"], "wccpd-" + word);
+        EXPECT_EQ(explained(shown, -1, &text), 1);
+    }
+    from.lost_after = 0;
+    EXPECT_EQ(explained(from.gather(), -1, &text, true), 2);
+    EXPECT_EQ(json::parse(text)["reasons"][0]["reason"], "mgmtd-unreachable");
+    from.lost_after = SIZE_MAX;
+    snapshot_limits other;
+    other.only = 52;
+    EXPECT_EQ(explained(from.gather(other), 52, &text, true), 2);
+}
+
+static std::string text_of_file(const char *name) {
+    std::ifstream in(std::string(WCCP_SOURCE_DIR "/") + name);
+    return {std::istreambuf_iterator<char>(in), {}};
+}
+
+TEST(Show, EveryReasonHasWordsAndIsInTheDocuments) {
+    EXPECT_NE(text_of_file("docs/operations.md").find(reason_table_markdown()), std::string::npos)
+        << "the table is what \"mgmtctl explain --list\" prints";
+    const std::string engine = text_of_file("engine/wccp_reasons.cpp");
+    size_t codes = 0;
+    for (size_t at = 0; (at = engine.find("    {\"", at)) != std::string::npos; codes++) {
+        at += 6;
+        const std::string code = engine.substr(at, engine.find('"', at) - at);
+        EXPECT_TRUE(code.empty() || find_reason_text(code)) << code;
+    }
+    EXPECT_GT(codes, 40u);
 }
 
 // --- Redirected traffic

@@ -73,5 +73,9 @@ int ctl_rollback(const ctl_options &options, uint32_t number);
 
 // The whole appliance (show.cpp).
 int ctl_show(const ctl_options &options);
+// Why the group, or everything (-1), does not work (explain.cpp). 0: nothing needs attention, 1: something
+// does, 2: there is no such group, or no answer.
+int ctl_explain(const ctl_options &options, int group);
+int ctl_list_reasons(const ctl_options &options); // all that there can be
 // Events as they come (watch.cpp). `count` 0: until a signal ends the program.
 int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count);

@@ -104,7 +104,8 @@ struct command_line {
     std::function<int()> run;
     std::vector<std::string> words;
     std::string name = "/";
-    bool children = false, leaves = false, existing = false, check = false;
+    bool children = false, leaves = false, existing = false, check = false, list = false;
+    int group = -1;
     uint64_t count = 0;
     ctl_apply_options apply;
     uint32_t from = 0, to = 0; // commits
@@ -248,6 +249,14 @@ static void add_show_command(command_line *line) {
         "--no-colour", [options] { options->colour = 0; }, "without colour");
 }
 
+static void add_explain_command(command_line *line) {
+    CLI::App *command = add_command(line, "explain", "why a group does not work, and what to do", [line] {
+        return line->list ? ctl_list_reasons(line->options) : ctl_explain(line->options, line->group);
+    });
+    command->add_option("GROUP", line->group, "this group alone")->check(CLI::Range(0, 255));
+    command->add_flag("--list", line->list, "every reason that there can be, as a table");
+}
+
 static void add_shell_command(command_line *line) {
     CLI::App *command = add_command(
         line, "complete", "", [line] { return ctl_complete(line->words.empty() ? "" : line->words[0]); });
@@ -271,6 +280,7 @@ int main(int argc, char **argv) {
     add_config_commands(&line);
     add_drain_command(&line);
     add_show_command(&line);
+    add_explain_command(&line);
     add_shell_command(&line);
 
     take_signals();

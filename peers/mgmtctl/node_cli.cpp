@@ -6,7 +6,9 @@
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/connection.h"
 #include "peers/mgmtctl/nodes.h"
+#include "peers/mgmtctl/reasons.h"
 #include "peers/mgmtctl/render.h"
+#include "peers/mgmtctl/show_gather.h"
 #include "runtime/common.h"
 
 // --- get and walk
@@ -147,6 +149,34 @@ int ctl_delete(const ctl_options &options, const std::vector<std::string> &names
 
 // --- alarms and completion
 
+// What the alarms of groups come from. A wccpd that is gone, or hangs, raises none: its absence is one.
+static bool explain_alarms(connection *mgmtd, std::vector<ctl_alarm> *inout, bool *out_known) {
+    snapshot_limits limits;
+    if (inout->empty())
+        limits.queries = 0; // of groups
+    const snapshot shown = gather_snapshot(
+        [mgmtd](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
+            const bool answered = mgmtd->ask(walk, name, out);
+            *out_reason = mgmtd->reason;
+            return answered;
+        },
+        limits);
+    const std::vector<reason> reasons = reasons_of(shown);
+    for (ctl_alarm &alarm : *inout)
+        for (const snapshot_alarm &each : shown.alarms) {
+            const reason *cause = each.group >= 0 ? main_reason(reasons, each.group) : nullptr;
+            if (cause && alarm.source == each.source && alarm.name == each.name) {
+                alarm.reason = cause->code;
+                alarm.cause = "group " + std::to_string(each.group) + ": " + cause->cause;
+            }
+        }
+    *out_known = shown.wccpd == wccpd_condition::running;
+    for (const reason &each : reasons)
+        if (each.code.starts_with("wccpd-"))
+            inout->push_back({"0", "wccpd", each.code, each.cause, "", "", each.code, each.cause});
+    return shown.unreachable.empty();
+}
+
 int ctl_alarms(const ctl_options &options, bool check) {
     connection mgmtd(options);
     if (!mgmtd.session)
@@ -156,8 +186,13 @@ int ctl_alarms(const ctl_options &options, bool check) {
         return mgmtd.lost();
     if (reply.code != 0)
         return tell_failure(options, {exit_of(reply.code), "", reply.message, "", reply.code});
-    const std::vector<ctl_alarm> standing = alarms_of(reply.bindings);
+    std::vector<ctl_alarm> standing = alarms_of(reply.bindings);
+    bool known = false;
+    if (!explain_alarms(&mgmtd, &standing, &known))
+        return mgmtd.lost();
     put(options.json ? json_line(json_alarms(standing)) : text_alarms(standing));
+    if (!known)
+        return CTL_UNREACHABLE;
     return check && !standing.empty() ? CTL_STANDING : CTL_OK;
 }
 

@@ -147,7 +147,7 @@ std::vector<ctl_alarm> alarms_of(const std::vector<ctl_binding> &bindings) {
             return alarm.type == type && alarm.source == source;
         });
         if (at == out.end())
-            at = out.insert(at, {type, source, "", "", "", ""});
+            at = out.insert(at, {type, source, "", "", "", "", "", ""});
         const std::string what = depth == 2 ? "" : name.parts.back();
         if (what.empty())
             at->text = binding.value;
@@ -169,7 +169,9 @@ ctl_json json_alarms(const std::vector<ctl_alarm> &alarms) {
                        {"source", alarm.source},
                        {"text", alarm.text},
                        {"since", alarm.since},
-                       {"reporter", alarm.reporter}});
+                       {"reporter", alarm.reporter},
+                       {"reason", alarm.reason.empty() ? ctl_json(nullptr) : ctl_json(alarm.reason)},
+                       {"cause", alarm.cause.empty() ? ctl_json(nullptr) : ctl_json(alarm.cause)}});
     return out;
 }
 
@@ -184,6 +186,7 @@ std::string text_alarms(const std::vector<ctl_alarm> &alarms) {
     std::string out;
     for (const ctl_alarm &alarm : alarms)
         out += alarm.since + "  " + alarm.name + std::string(names - alarm.name.size() + 2, ' ') +
-               alarm.source + std::string(sources - alarm.source.size() + 2, ' ') + alarm.text + "\n";
+               alarm.source + std::string(sources - alarm.source.size() + 2, ' ') +
+               (alarm.cause.empty() ? alarm.text : alarm.cause) + "\n";
     return out;
 }

@@ -38,6 +38,7 @@ int tell_failure(const ctl_options &options, const ctl_failure &failure);
 // The active alarms, from a walk of NODE_ALARMS_RAISED.
 struct ctl_alarm {
     std::string type, source, name, text, since, reporter;
+    std::string reason, cause; // why, by its code and in words; empty: unknown
 };
 std::vector<ctl_alarm> alarms_of(const std::vector<ctl_binding> &bindings);
 ctl_json json_alarms(const std::vector<ctl_alarm> &alarms);

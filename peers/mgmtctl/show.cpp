@@ -277,7 +277,7 @@ int ctl_show(const ctl_options &options) {
     if (shown.unreachable.empty() || options.json)
         show_one(&self, shown);
     if (shown.unreachable.empty())
-        return CTL_OK;
+        return shown.wccpd == wccpd_condition::running ? CTL_OK : CTL_UNREACHABLE;
     if (!options.json)
         fprintf(stderr, "mgmtctl: %s\n", shown.unreachable.c_str());
     return CTL_UNREACHABLE;

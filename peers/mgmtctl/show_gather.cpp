@@ -4,8 +4,8 @@
 // A group costs a walk of its nodes (its texts among them), one of its routers with their appliances, one of
 // its configuration, and two queries for each appliance, whose numbers cannot be walked. wccpd answers node
 // by node under its engine lock. Therefore, when there are more groups than a screen has room for, each is
-// gathered briefly, from six nodes, and its share is the one at its first router. The number of queries is
-// bounded in any case.
+// gathered briefly, from six nodes and its reasons, and its share is the one at its first router. The number
+// of queries is bounded in any case.
 //
 // Each answer shows its own moment. A group, router or appliance that is gone by the time it is asked for
 // has no nodes and is left out. Once wccpd has not answered, it is not asked again for this snapshot.
@@ -22,6 +22,7 @@
 #include "runtime/common.h"
 
 static constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
+static constexpr size_t REASONS_MAX = 64; // of a group
 
 namespace {
 struct gathering {
@@ -103,6 +104,7 @@ static const node_row<snapshot_group> group_rows[] = {
          g->designated = v.ends_with(", DESIGNATED");
      }},
     {"uptime", [](snapshot_group *g, const std::string &v) { g->uptime_ms = number_of<uint64_t>(v, 0); }},
+    {"since", [](snapshot_group *g, const std::string &v) { g->since_ms = number_of<uint64_t>(v, 0); }},
     {"app_id", [](snapshot_group *g, const std::string &v) { g->address = clean_text(v, 15); }},
     {"num_routers",
      [](snapshot_group *g, const std::string &v) { g->routers_heard = number_of<size_t>(v, 0); }},
@@ -119,6 +121,40 @@ static const node_row<snapshot_group> config_rows[] = {
     {"priority", [](snapshot_group *g, const std::string &v) { g->priority = number_of<int64_t>(v, -1); }},
     {"policy_grp", [](snapshot_group *g, const std::string &v) { g->policy = number_of<int64_t>(v, -1); }},
 };
+
+static const node_row<snapshot_reason> reason_rows[] = {
+    {"code", [](snapshot_reason *r, const std::string &v) { r->code = clean_text(v, 31); }},
+    {"sender",
+     [](snapshot_reason *r, const std::string &v) { r->sender = v == "0.0.0.0" ? "" : clean_text(v, 15); }},
+    {"offered", [](snapshot_reason *r, const std::string &v) { r->offered = clean_text(v, 63); }},
+    {"wanted", [](snapshot_reason *r, const std::string &v) { r->wanted = clean_text(v, 63); }},
+    {"count", [](snapshot_reason *r, const std::string &v) { r->count = number_of<uint64_t>(v, 0); }},
+    {"first", [](snapshot_reason *r, const std::string &v) { r->first_ms = number_of<int64_t>(v, 0); }},
+    {"last", [](snapshot_reason *r, const std::string &v) { r->last_ms = number_of<int64_t>(v, 0); }},
+};
+
+// Those below `above`. One that has ended meanwhile has no code, and is left out.
+static bool gather_reasons(gathering *work, const std::string &above, std::vector<snapshot_reason> *out) {
+    ctl_reply reply;
+    const std::string root = above + "/reason";
+    if (!work->ask_wccpd(ctl_walk::subtree, root, &reply))
+        return false;
+    std::string number;
+    for (const ctl_binding &binding : reply.bindings) {
+        const std::vector<std::string> parts = parts_below(root, binding.name);
+        if (parts.size() != 2)
+            continue;
+        if (out->empty() || parts[0] != number) {
+            if (out->size() >= REASONS_MAX)
+                break;
+            number = parts[0];
+            out->emplace_back();
+        }
+        take_node(reason_rows, parts[1], binding.value, &out->back());
+    }
+    std::erase_if(*out, [](const snapshot_reason &each) { return each.code.empty(); });
+    return true;
+}
 
 static std::string group_root(const char *above, int id) {
     return std::string(above) + "/" + std::to_string(id);
@@ -292,6 +328,30 @@ static bool gather_briefly(gathering *work, snapshot_group *group, const std::st
     return true;
 }
 
+// How many Here-I-Am no router answers.
+static bool gather_sent(gathering *work, snapshot_group *group, const std::string &root) {
+    ctl_reply reply;
+    const bool silent =
+        std::any_of(group->routers.begin(), group->routers.end(),
+                    [](const snapshot_router &router) { return router.connection == "none"; });
+    if (!silent || !group->running)
+        return true;
+    if (!work->ask_wccpd(ctl_walk::node, root + "/counter/tx_here_i_am", &reply))
+        return false;
+    if (!reply.bindings.empty())
+        group->here_i_ams = number_of<uint64_t>(reply.bindings[0].value, 0);
+    return true;
+}
+
+// A table is shown by the method that was agreed. What a router reports by another one is not what it shows.
+static void drop_misread_tables(snapshot_group *group) {
+    for (const snapshot_reason &reason : group->reasons)
+        if (reason.code == "method-differs" && reason.offered.ends_with(" by the router"))
+            for (snapshot_table &table : group->tables)
+                std::erase(table.routers, reason.sender);
+    std::erase_if(group->tables, [](const snapshot_table &table) { return table.routers.empty(); });
+}
+
 static bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) {
     std::vector<std::string> configured;
     if (group->configured && !gather_config(work, group, &configured))
@@ -299,16 +359,19 @@ static bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) 
     group->routers_configured = configured.size();
     const std::string root = group_root(NODE_GROUP_STATE, group->id);
     if (work->shown.brief)
-        return !in_wccpd || gather_briefly(work, group, root);
+        return !in_wccpd ||
+               (gather_briefly(work, group, root) && gather_reasons(work, root, &group->reasons));
     ctl_reply reply;
     group_texts texts;
     if (in_wccpd && !work->ask_wccpd(ctl_walk::children, root, &reply))
         return false;
     take_group_nodes(root, reply, group, &texts);
-    if (!gather_routers(work, group, configured) || !gather_weights(work, group, texts.appliances))
+    if (!gather_routers(work, group, configured) || !gather_weights(work, group, texts.appliances) ||
+        (in_wccpd && !gather_reasons(work, root, &group->reasons)) || !gather_sent(work, group, root))
         return false;
     take_group_text(texts.group, group);
     take_assignment_text(texts.assignment, group);
+    drop_misread_tables(group);
     finish_shares(group);
     sort_appliances(group);
     return true;
@@ -370,7 +433,8 @@ static void gather(gathering *work) {
         !gather_redirected(work) || !work->ask(ctl_walk::children, NODE_GROUP_CONFIG, &configs) ||
         !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_STATUS, &alive) ||
         !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_VERSION, &version) ||
-        !work->ask_wccpd(ctl_walk::children, NODE_GROUP_STATE, &states))
+        !work->ask_wccpd(ctl_walk::children, NODE_GROUP_STATE, &states) ||
+        !gather_reasons(work, NODE_WCCPD_STATE, &work->shown.reasons))
         return;
     work->shown.mode = first_value(mode);
     work->shown.status = first_value(alive);
@@ -380,6 +444,8 @@ static void gather(gathering *work) {
     add_ids(NODE_GROUP_STATE, states, &running);
     std::set_union(configured.begin(), configured.end(), running.begin(), running.end(),
                    std::back_inserter(all));
+    if (work->limits.only >= 0)
+        std::erase_if(all, [&](int id) { return id != work->limits.only; });
     work->shown.groups_total = all.size();
     work->shown.brief = all.size() > work->limits.detailed;
     for (const int id : all) {

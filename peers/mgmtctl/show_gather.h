@@ -12,6 +12,7 @@ struct snapshot_limits {
     size_t detailed = 256;
     size_t listed = 256;
     size_t alarms = 256;
+    int only = -1;         // the one group to be gathered; -1: all
     size_t queries = 8192; // groups that are left when these are used up count as not shown
 };
 

@@ -1,7 +1,9 @@
 // A snapshot for scripts. The keys are documented (docs/mgmtctl.md) and stay; what isn't known is null.
 #include <nlohmann/json.hpp>
 
+#include "peers/mgmtctl/reasons.h"
 #include "peers/mgmtctl/show_draw.h"
+#include "peers/mgmtctl/show_json.h"
 #include "peers/mgmtctl/traffic_json.h"
 
 using json = nlohmann::ordered_json;
@@ -54,6 +56,20 @@ static json table_json(const snapshot_group &group, const snapshot_table &table)
     return {{"kind", table.mask ? "mask" : "hash"}, {"routers", table.routers}, {"buckets", runs}};
 }
 
+json reason_json(const reason &one) {
+    return {{"reason", one.code},
+            {"group", number_or_null(one.group)},
+            {"attention", one.attention},
+            {"who", text_or_null(one.who)},
+            {"offered", text_or_null(one.offered)},
+            {"wanted", text_or_null(one.wanted)},
+            {"count", one.count},
+            {"first_ms", number_or_null(one.first_ms)},
+            {"last_ms", number_or_null(one.last_ms)},
+            {"cause", one.cause},
+            {"next", one.next}};
+}
+
 static json group_json(const snapshot_group &group) {
     json out = {{"id", group.id},
                 {"configured", group.configured},
@@ -100,15 +116,24 @@ std::string draw_json(const snapshot &shown) {
     for (const snapshot_group &group : shown.groups)
         out["groups"].push_back(group_json(group));
     out["traffic"] = traffic_json(shown.traffic);
-    out["alarms_total"] = shown.alarms_total;
+    const std::vector<reason> reasons = reasons_of(shown);
+    out["reasons"] = json::array();
+    for (const reason &each : reasons)
+        out["reasons"].push_back(reason_json(each));
+    const bool known = shown.alarms_total > 0 || shown.wccpd == wccpd_condition::running;
+    out["alarms_total"] = known ? json(shown.alarms_total) : json(nullptr);
     out["alarms"] = json::array();
-    for (const snapshot_alarm &alarm : shown.alarms)
+    for (const snapshot_alarm &alarm : shown.alarms) {
+        const reason *cause = alarm.group >= 0 ? main_reason(reasons, alarm.group) : nullptr;
         out["alarms"].push_back({{"type", alarm.type},
                                  {"name", alarm.name},
                                  {"group", number_or_null(alarm.group)},
                                  {"source", alarm.source},
                                  {"text", alarm.text},
                                  {"since", text_or_null(alarm.since)},
-                                 {"reporter", text_or_null(alarm.reporter)}});
+                                 {"reporter", text_or_null(alarm.reporter)},
+                                 {"reason", cause ? json(cause->code) : json(nullptr)},
+                                 {"cause", cause ? json(cause->cause) : json(nullptr)}});
+    }
     return out.dump(-1, ' ', true, json::error_handler_t::replace);
 }

@@ -44,6 +44,13 @@ struct snapshot_alarm {
     std::string source, text, since, reporter;
     int group = -1;
 };
+// Why something does not work, as wccpd noted it; wccpd's codes are in the table of reasons.h.
+struct snapshot_reason {
+    std::string code, sender; // the sender is empty where there is none
+    std::string offered, wanted;
+    uint64_t count = 0;
+    int64_t first_ms = 0, last_ms = 0; // how long ago
+};
 struct snapshot_group {
     int id = 0;
     // What is configured.
@@ -56,6 +63,9 @@ struct snapshot_group {
     std::string state; // "ACTIVE", "BACKUP", "INIT"
     bool designated = false;
     uint64_t uptime_ms = 0;
+    uint64_t since_ms = 0;   // since it was started or stopped
+    uint64_t here_i_ams = 0; // sent; known where a router is silent
+    std::vector<snapshot_reason> reasons;
     std::string address; // of this appliance in the group
     std::string link;    // of its first interface: "up", "down"; empty: unknown
     size_t routers_configured = 0, routers_heard = 0;
@@ -74,6 +84,7 @@ struct snapshot {
     size_t roles_active = 0, roles_backup = 0;
     std::vector<snapshot_alarm> alarms;
     size_t alarms_total = 0;
+    std::vector<snapshot_reason> reasons; // of packets that belong to no group
     traffic_state traffic;
 };
 

@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <cstring>
 
+#include "peers/mgmtctl/reasons.h"
 #include "peers/mgmtctl/show_draw.h"
 
 static constexpr int STRIP_CELLS = 64;
@@ -90,7 +91,8 @@ static std::string plural(size_t count, const char *what) {
 
 // --- Words
 
-static std::string alarm_words(const snapshot_alarm &alarm) {
+// An alarm's text names the cause where one is known.
+static std::string alarm_words(const snapshot_alarm &alarm, const std::vector<reason> &reasons) {
     static const struct {
         const char *name, *words;
     } known[] = {
@@ -100,7 +102,8 @@ static std::string alarm_words(const snapshot_alarm &alarm) {
     std::string text = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": " : alarm.source + ": ";
     const auto *row = std::find_if(std::begin(known), std::end(known),
                                    [&](const auto &each) { return alarm.name == each.name; });
-    text += row != std::end(known) ? row->words : alarm.text;
+    const reason *cause = alarm.group >= 0 ? main_reason(reasons, alarm.group) : nullptr;
+    text += cause ? cause->cause : row != std::end(known) ? row->words : alarm.text;
     return alarm.since.empty() ? text : text + ", since " + alarm.since;
 }
 
@@ -109,7 +112,8 @@ static bool in_alarm(const snapshot &shown, const snapshot_group &group) {
                        [&](const snapshot_alarm &alarm) { return alarm.group == group.id; });
 }
 
-static std::pair<std::string, style> state_words(const snapshot &shown, const snapshot_group &group) {
+static std::pair<std::string, style> state_words(const snapshot &shown, const snapshot_group &group,
+                                                 bool troubled = false) {
     if (group.admin == "down")
         return {"admin down", style::dim};
     if (shown.traffic.left.contains(group.id))
@@ -119,9 +123,13 @@ static std::pair<std::string, style> state_words(const snapshot &shown, const sn
     std::string text = group.state + (group.designated ? ", designated" : "");
     if (!group.configured)
         text += ", not configured";
+    const bool missing = std::any_of(group.reasons.begin(), group.reasons.end(),
+                                     [](const auto &each) { return each.code == "interface-missing"; });
+    if (missing)
+        return {text + ", no interface", style::bad};
     if (group.link == "down")
         return {text + ", link down", style::bad};
-    return {text, group.state == "INIT" ? style::warn : style::good};
+    return {text, group.state == "INIT" || troubled ? style::warn : style::good};
 }
 
 static const snapshot_appliance *own(const snapshot_group &group) {
@@ -171,11 +179,15 @@ std::vector<std::string> draw_lines(const snapshot &shown) {
     if (shown.wccpd != wccpd_condition::running)
         out.emplace_back(shown.wccpd == wccpd_condition::absent ? "wccpd is not running"
                                                                 : "wccpd does not answer");
+    const std::vector<reason> reasons = reasons_of(shown);
     for (const snapshot_alarm &alarm : shown.alarms)
-        out.push_back("alarm  " + alarm_words(alarm));
-    for (const snapshot_group &group : shown.groups)
+        out.push_back("alarm  " + alarm_words(alarm, reasons));
+    for (const snapshot_group &group : shown.groups) {
         out.push_back("group " + std::to_string(group.id) + "  " + state_words(shown, group).first +
                       one_line(group, shown.brief));
+        if (const reason *cause = main_reason(reasons, group.id))
+            out.back() += "  " + cause->code;
+    }
     out.push_back(traffic_head(shown.traffic));
     for (const traffic_intercept &intercept : shown.traffic.intercepts)
         out.push_back("proxy of group " + std::to_string(intercept.group) + "  " + intercept.proxy);
@@ -191,6 +203,7 @@ struct screen {
     const snapshot &shown;
     const screen_form &form;
     std::vector<std::string> lines;
+    std::vector<reason> reasons;
 
     pen begin() const { return {form, "", 0}; }
     void end(pen *line) { lines.push_back(std::move(line->out)); }
@@ -198,6 +211,18 @@ struct screen {
         pen line = begin();
         add_cells(&line, words, how);
         end(&line);
+    }
+    // Over as many lines as it takes; those after the first are indented further.
+    void paragraph(std::string words, style how = style::plain) {
+        const auto room = static_cast<size_t>(form.columns);
+        while (words.size() > room) {
+            const size_t blank = words.rfind(' ', room);
+            if (blank == std::string::npos || blank < 8)
+                break;
+            text(words.substr(0, blank), how);
+            words = "    " + words.substr(blank + 1);
+        }
+        text(words, how);
     }
 };
 } // namespace
@@ -233,19 +258,21 @@ static void draw_head(screen *on, size_t alarms_most) {
                                                                         : "wccpd does not answer";
     const std::string counts =
         (shown.mode.empty() ? "" : "   mode " + shown.mode) + "   " + group_counts(shown) + "   ";
-    const std::string alarms = shown.alarms_total ? plural(shown.alarms_total, "alarm") : "no alarm";
+    const std::string alarms = shown.alarms_total ? plural(shown.alarms_total, "alarm")
+                               : running          ? "no alarm"
+                                                  : "alarms unknown";
     const std::string version = shown.version.empty() ? "" : " (" + shown.version + ")";
     add_cells(&line, status, running ? style::bold : style::bad);
     if ((status + version + counts + alarms + on->form.corner).size() <=
         static_cast<size_t>(on->form.columns))
         add_cells(&line, version);
     add_cells(&line, counts);
-    add_cells(&line, alarms, shown.alarms_total ? style::bad : style::plain);
+    add_cells(&line, alarms, shown.alarms_total || !running ? style::bad : style::plain);
     add_cells(&line, on->form.corner, style::dim);
     on->end(&line);
     const size_t listed = std::min(shown.alarms.size(), alarms_most);
     for (size_t i = 0; i < listed; i++)
-        on->text("! " + alarm_words(shown.alarms[i]), style::bad);
+        on->text("! " + alarm_words(shown.alarms[i], on->reasons), style::bad);
     if (listed < shown.alarms_total)
         on->text("! " + plural(shown.alarms_total - listed, "alarm") + (listed ? " more" : ""), style::bad);
 }
@@ -253,9 +280,10 @@ static void draw_head(screen *on, size_t alarms_most) {
 static void draw_group_head(screen *on, const snapshot_group &group) {
     pen line = on->begin();
     add_cells(&line, format("%-4d", group.id), style::bold);
-    const auto [words, how] = state_words(on->shown, group);
+    const reason *cause = main_reason(on->reasons, group.id);
+    const auto [words, how] = state_words(on->shown, group, cause != nullptr);
     add_cells(&line, words, how);
-    if (in_alarm(on->shown, group))
+    if (cause || in_alarm(on->shown, group))
         add_cells(&line, " !", style::bad);
     std::string text;
     if (group.uptime_ms)
@@ -274,14 +302,22 @@ static void draw_group_head(screen *on, const snapshot_group &group) {
         text += format("  policy %" PRId64, group.policy);
     add_cells(&line, text);
     on->end(&line);
+    if (!cause)
+        return;
+    const std::string times = reason_times(*cause);
+    on->paragraph("  " + cause->cause + (times.empty() ? "" : ", " + times), style::warn);
+    on->paragraph("  > " + cause->next);
 }
 
-static void draw_router(screen *on, const snapshot_router &router) {
+static void draw_router(screen *on, const snapshot_group &group, const snapshot_router &router) {
     const auto method = [](const std::string &word) { return word.empty() ? "-" : word.c_str(); };
     pen line = on->begin();
     add_cells(&line, format("  router %-15s ", router.address.c_str()));
     if (router.connection == "none") {
-        add_cells(&line, "nothing heard", style::bad);
+        const auto noted = std::find_if(group.reasons.begin(), group.reasons.end(), [&](const auto &each) {
+            return each.sender == router.address && each.count;
+        });
+        add_cells(&line, noted == group.reasons.end() ? "nothing heard" : noted->code, style::bad);
     } else {
         add_cells(&line, format("%-7s", router.connection.c_str()),
                   router.connection == "two-way" ? style::good : style::warn);
@@ -377,7 +413,7 @@ static void draw_group(screen *on, const snapshot_group &group, size_t most) {
     draw_group_head(on, group);
     for (const size_t i :
          chosen(group.routers, most, [](const auto &r) { return r.connection != "two-way"; }))
-        draw_router(on, group.routers[i]);
+        draw_router(on, group, group.routers[i]);
     draw_more(on, group.routers.size(), most, "router");
     for (const size_t i : chosen(group.appliances, most, [](const auto &one) { return one.self; }))
         draw_appliance(on, group.appliances[i], static_cast<int>(i));
@@ -413,7 +449,7 @@ static void draw_traffic(screen *on, size_t most) {
 }
 
 static std::vector<std::string> draw_whole(const snapshot &shown, const screen_form &form, size_t most) {
-    screen on = {shown, form, {}};
+    screen on = {shown, form, {}, reasons_of(shown)};
     draw_head(&on, most);
     for (const snapshot_group &group : shown.groups) {
         on.text("");
@@ -430,7 +466,7 @@ static std::vector<std::string> draw_whole(const snapshot &shown, const screen_f
 }
 
 static std::vector<std::string> draw_briefly(const snapshot &shown, const screen_form &form) {
-    screen on = {shown, form, {}};
+    screen on = {shown, form, {}, reasons_of(shown)};
     draw_head(&on, 3);
     if (shown.unreachable.empty() && shown.traffic.tunneld != tunneld_condition::running)
         on.text(traffic_head(shown.traffic));
@@ -442,11 +478,13 @@ static std::vector<std::string> draw_briefly(const snapshot &shown, const screen
             break;
         pen line = on.begin();
         add_cells(&line, format("%-4d", group.id), style::bold);
-        const auto [words, how] = state_words(shown, group);
+        const reason *cause = main_reason(on.reasons, group.id);
+        const auto [words, how] = state_words(shown, group, cause != nullptr);
         add_cells(&line, format("%-20s", words.c_str()), how);
-        add_cells(&line, in_alarm(shown, group) ? " !" : "  ", style::bad);
+        add_cells(&line, cause || in_alarm(shown, group) ? " !" : "  ", style::bad);
         add_cells(&line, group.uptime_ms ? format("  up %-11s", duration_text(group.uptime_ms).c_str()) : "");
         add_cells(&line, one_line(group, shown.brief));
+        add_cells(&line, cause ? "  " + cause->code : "", style::warn);
         on.end(&line);
         drawn++;
     }

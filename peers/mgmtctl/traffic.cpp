@@ -361,5 +361,7 @@ std::vector<traffic_reason> traffic_reasons(const traffic_state &state) {
     std::vector<traffic_reason> out;
     for (const auto &row : rows)
         row.look(state, {row.word, &out});
+    for (traffic_reason &each : out) // the words of all reasons are written so
+        std::replace(each.word.begin(), each.word.end(), '_', '-');
     return out;
 }

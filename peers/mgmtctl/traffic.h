@@ -83,7 +83,7 @@ std::string drain_text(const traffic_drain &drain, int64_t now); // "draining, 1
 
 // Why traffic does not go where somebody would expect it to.
 struct traffic_reason {
-    std::string word; // "own_traffic", "refused_source", ...: does not change
+    std::string word; // "own-traffic", "refused-source", ...: a code of reasons.h
     int group;        // -1: of the whole appliance
     std::string text; // one line, at most 76 characters, without counts
 };

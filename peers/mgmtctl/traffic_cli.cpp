@@ -104,7 +104,7 @@ static void put_absence(tunneld_condition condition) {
 
 static void put_reasons(const std::vector<traffic_reason> &reasons, int group) {
     for (const traffic_reason &reason : reasons)
-        if (reason.group == group && reason.word != "proxy_down") // has been said with the proxy
+        if (reason.group == group && reason.word != "proxy-down") // has been said with the proxy
             put((group < 0 ? "" : "  ") + reason.text + "\n");
 }
 

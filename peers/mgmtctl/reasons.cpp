@@ -1,0 +1,386 @@
+// The table of reasons, and those that follow from the state of a group.
+//
+// wccpd's own reasons are taken as they are: it forgets what no longer holds. From the state comes what
+// nobody had to refuse: a router that does not answer, a table that is still to come, buckets that others
+// have. Such a reason is left out where a reason of wccpd explains it.
+#include "peers/mgmtctl/reasons.h"
+
+#include <algorithm>
+#include <map>
+
+#include "peers/mgmtctl/show_draw.h"
+
+const std::vector<reason_text> &reason_texts() {
+    static const std::vector<reason_text> texts = {
+        // The programs.
+        {"mgmtd-unreachable", true, "mgmtd does not answer: {offered}", "start mgmtd, or look at its log"},
+        {"wccpd-absent", true, "wccpd is not running: no group takes part",
+         "start wccpd; its log says why it ended"},
+        {"wccpd-silent", true, "wccpd does not answer: nothing is known of the groups",
+         "look at its log; when it stays so, restart it"},
+        {"tunneld-absent", true, "tunneld has no session: no tunnels, no traffic",
+         "start tunneld; its log says why it ended"},
+        {"tunneld-silent", true, "tunneld does not answer", "look at its log; when it stays so, restart it"},
+        // A group that cannot begin.
+        {"disabled", false, "the group is disabled", "mgmtctl group set {group} admin up"},
+        {"no-interface", true, "the group has no interface", "mgmtctl group set {group} interface NAME"},
+        {"no-router", true, "the group has no router", "mgmtctl group set {group} router ADDRESS"},
+        {"not-taken", true, "wccpd has not taken the group over",
+         "its log says why; then mgmtctl group "
+         "restart {group}"},
+        {"not-configured", true, "wccpd runs the group, which is not configured",
+         "restart wccpd; when it comes back, report it"},
+        {"left", true, "the group has left its routers: {offered}",
+         "mgmtctl intercept show {group}; the group returns with its proxy"},
+        {"drain", true, "the group is drained", "mgmtctl drain cancel {group} ends it"},
+        {"interface-missing", true, "there is no interface {wanted}",
+         "create it, or mgmtctl group set {group} interface NAME"},
+        {"interface-down", true, "the interface {wanted} is down",
+         "ip link set {wanted} up; check the cable"},
+        {"interface-no-address", true, "the interface {wanted} has no IPv4 address",
+         "ip address add ADDRESS/LENGTH dev {wanted}"},
+        {"port-taken", true, "UDP port 2048 on {wanted} is taken: {offered}",
+         "ss -lunp 'sport = 2048' shows by whom; stop that program"},
+        {"socket-failed", true, "no socket can be opened on {wanted}: {offered}",
+         "free what is lacking; wccpd tries again every 30 s"},
+        {"join-failed", true, "the multicast group cannot be joined on {wanted}: {offered}",
+         "sysctl net.ipv4.igmp_max_memberships; wccpd tries again every 30 s"},
+        {"here-i-am-not-built", true, "no Here-I-Am can be built: {offered}", "report it with wccpd's log"},
+        {"send-failed", true, "sending to {who} fails: {offered}",
+         "check the route and the firewall towards {who}"},
+        {"no-memory", true, "wccpd has no memory for {offered} ({who})",
+         "give it more (limit of locked memory, mem.conf)"},
+        // A router whose messages are refused.
+        {"security-missing", true, "{who} signs no message, but the group has a password",
+         "set the password on the router, or mgmtctl group set {group} password default"},
+        {"security-unwanted", true, "{who} signs its messages ({offered}), but the group has no password",
+         "mgmtctl group set {group} password -, as on the router"},
+        {"password-mismatch", true, "{who} signs its messages with another password",
+         "set the same one on both: mgmtctl group set {group} password -"},
+        {"message-version", true, "{who} speaks version {offered} of the protocol, not {wanted}",
+         "set the router to version 2"},
+        {"view-length", true, "the view of {who} has {offered}, by its content {wanted}",
+         "mgmtctl group set {group} compatibility ios or nexus, as the router is"},
+        {"message-length", true, "a message of {who} has {offered}, but {wanted}",
+         "look for a path that cuts packets (MTU, firewall)"},
+        {"message-malformed", true, "a message of {who} has {offered}; expected: {wanted}",
+         "capture it (udp port 2048); the router or the path breaks it"},
+        {"message-type", false, "{who} sends {offered}, which no appliance expects",
+         "it is probably another appliance: give it the routers' addresses"},
+        {"router-id-zero", true, "a router calls itself 0.0.0.0",
+         "give the router an id or a loopback address"},
+        {"routers-exhausted", true, "{who} is one router too many; {wanted}",
+         "spread the routers over groups"},
+        {"forwarding-not-offered", true, "{who} offers forwarding by {offered}, wanted is {wanted}",
+         "mgmtctl group set {group} encap either, or change the router or the first router's method"},
+        {"assignment-not-offered", true, "{who} offers assignment by {offered}, wanted is {wanted}",
+         "mgmtctl group set {group} assign either, or change the router or the first router's method"},
+        {"return-not-offered", true, "{who} offers return by {offered}, wanted is {wanted}",
+         "let the router offer {wanted}"},
+        {"service-mismatch", true, "{who} has the service with {offered}; here it is {wanted}",
+         "make them equal: mgmtctl group set {group} priority, protocol, hash-..., or on the router"},
+        {"group-unknown", true, "{who} asks for {offered}, which is not configured here",
+         "mgmtctl group add, or take this appliance's address off that group on the router"},
+        {"group-disabled", false, "{who} still sends to the group, which is disabled",
+         "nothing, or mgmtctl group set {group} admin up"},
+        {"group-stopped", false, "{who} sends while the group cannot run",
+         "see the other reasons of the group"},
+        {"query-refused", false, "{who} sent {offered}",
+         "nothing, unless it goes on; then restart the group"},
+        // Tunnels.
+        {"mailbox-missing", true, "wccpd has no mailbox to tunneld, so {who} gets no tunnel",
+         "another wccpd owns it: stop that one, then restart wccpd"},
+        {"tunnel-timeout", true, "tunneld did not answer in 2 s, so {who} gets no tunnel",
+         "look at tunneld's log; wccpd tries again with each message"},
+        {"tunnel-refused", true, "tunneld refuses the tunnel to {who} ({offered} {wanted})",
+         "its log says why; mgmtctl tunnel show"},
+        {"tunnel-ids-exhausted", true, "all tunnel ids are used ({wanted}), so {who} gets no tunnel",
+         "let fewer routers forward or return by GRE"},
+        // Who hears whom.
+        {"not-in-view", true,
+         "{who} answers, but does not list this appliance (it lists {offered}, not {wanted})",
+         "wait 20 s; then check the router's list of appliances and its redirect ACL"},
+        {"router-silent", true, "{who} has stopped answering: no I-See-You for 40 s",
+         "check the router and the path to it"},
+        {"no-answer", true, "{who} does not answer ({offered})",
+         "check address, service group, password and path (UDP 2048) on the router"},
+        {"election-blocked", true,
+         "no appliance can be designated: a router lists {who}, which is here: {offered}",
+         "add {who} to the group (mgmtctl group set {group} router ...), or free it of the group"},
+        // The table.
+        {"method-differs", true, "assignment is {offered}, here it is by {wanted}",
+         "set the same assignment on all appliances (group set {group} assign), then group restart {group}"},
+        {"mask-differs", true, "{who} uses the mask {offered}, here it is {wanted}",
+         "set the same mask on all appliances"},
+        {"appliance-left-out", true, "{who} gets no share: it is {offered}, not {wanted}",
+         "let all routers list {who}"},
+        {"table-not-built", true, "no table can be built: {offered}", "mgmtctl group restart {group}"},
+        {"not-acknowledged", true, "{who} has not acknowledged the table ({offered}, wanted {wanted})",
+         "wait 20 s; then look at the router's log for refused assignments"},
+        {"assignment-differs", true, "{who} assigns {offered}, wanted is {wanted}",
+         "compare the routers: mgmtctl show; a router with another table needs a new one"},
+        {"assignment-unreadable", true, "the assignment of {who} cannot be read",
+         "mgmtctl group set {group} compatibility ios or nexus, as the router is"},
+        {"waiting-assignment", true, "the routers answer; no table is in force yet ({offered})",
+         "wait: the designated appliance sends it 16 s after the last change"},
+        {"restart-needed", true, "the group runs with {offered}, but is configured with {wanted}",
+         "mgmtctl group restart {group}"},
+        {"weight-zero", false, "the routers redirect elsewhere, for this appliance's weight is 0 ({offered})",
+         "mgmtctl group set {group} weight N"},
+        {"redirected-elsewhere", true, "the routers redirect to others: {offered}",
+         "check that the designated appliance lists this one and gives it a weight"},
+        {"not-designated", false, "{who} is designated: it has the lowest address and makes the table",
+         "nothing; look there for what is wrong with the table"},
+        // Traffic.
+        {"lack", true, "all packets are returned: the kernel lacks what sorts them",
+         "mgmtctl tunnel show; load the kernel's modules, or use --plane user"},
+        {"failure", true, "the kernel is not as wanted: something in it could not be changed",
+         "tunneld tries again; its log has the details"},
+        {"proxy-down", true, "the proxy is down; the last check says why",
+         "start the proxy: mgmtctl intercept show {group}"},
+        {"overload", true, "the proxy has too many flows; new ones are returned",
+         "more appliances, a larger limit, or less weight"},
+        {"slow-start", false, "slow start: a part of the weight is announced",
+         "nothing: the weight rises by itself"},
+        {"standing-by", false, "not ACTIVE in its policy group; new flows are returned",
+         "nothing: the group is a backup in its policy group"},
+        {"own-traffic", true, "the router redirects this appliance's own traffic",
+         "exclude this appliance's addresses from redirection on the router"},
+        {"refused-source", true, "GRE comes from an address that is no router of ours",
+         "accept it when it is the router's: mgmtctl tunnel accept ADDRESS"},
+        {"fragments", true, "packets come in fragments, and the MSS of no flow has been clamped",
+         "raise the MTU towards the routers, or let the MSS be clamped"},
+        {"no-intercept", true, "the routers redirect, but no intercept takes the packets: all are returned",
+         "mgmtctl intercept add {group} port 80 to PORT"},
+        {"flows-unprotected", false, "flows of the former owner of a bucket are not protected",
+         "mgmtctl intercept show {group}"},
+    };
+    return texts;
+}
+
+static size_t place_of(const std::string &code) {
+    const std::vector<reason_text> &texts = reason_texts();
+    const auto found =
+        std::find_if(texts.begin(), texts.end(), [&](const reason_text &row) { return code == row.code; });
+    return static_cast<size_t>(found - texts.begin());
+}
+
+const reason_text *find_reason_text(const std::string &code) {
+    const size_t place = place_of(code);
+    return place < reason_texts().size() ? &reason_texts()[place] : nullptr;
+}
+
+static std::string filled(std::string text, const reason &from) {
+    const std::pair<const char *, std::string> values[] = {
+        {"{who}", from.who.empty() ? "somebody" : from.who},
+        {"{offered}", from.offered.empty() ? "nothing" : from.offered},
+        {"{wanted}", from.wanted.empty() ? "something else" : from.wanted},
+        {"{group}", from.group < 0 ? "GROUP" : std::to_string(from.group)},
+    };
+    for (const auto &[name, value] : values)
+        for (size_t at = 0; (at = text.find(name, at)) != std::string::npos; at += value.size())
+            text.replace(at, std::string(name).size(), value);
+    return text;
+}
+
+// --- Of the state
+
+namespace {
+struct reason_list {
+    std::vector<reason> reasons;
+
+    reason *add(const char *code, int group) {
+        reasons.emplace_back().code = code;
+        reasons.back().group = group;
+        return &reasons.back();
+    }
+    void add_state(const char *code, const snapshot_group &group, const std::string &who,
+                   const std::string &offered, const std::string &wanted = "") {
+        reason *made = add(code, group.id);
+        made->who = who;
+        made->offered = offered;
+        made->wanted = wanted;
+        if (group.running)
+            made->first_ms = static_cast<int64_t>(group.uptime_ms ? group.uptime_ms : group.since_ms);
+    }
+};
+} // namespace
+
+static bool has_reason(const snapshot_group &group, std::initializer_list<const char *> codes,
+                       const std::string &who = "") {
+    return std::any_of(group.reasons.begin(), group.reasons.end(), [&](const snapshot_reason &each) {
+        return (who.empty() || each.sender == who) &&
+               std::any_of(codes.begin(), codes.end(), [&](const char *code) { return each.code == code; });
+    });
+}
+
+static void add_noted(const std::vector<snapshot_reason> &noted, int group, reason_list *list) {
+    for (const snapshot_reason &each : noted) {
+        reason *made = list->add(each.code.c_str(), group);
+        made->who = each.sender;
+        made->offered = each.offered;
+        made->wanted = each.wanted;
+        made->count = each.count;
+        made->first_ms = each.first_ms;
+        made->last_ms = each.last_ms;
+    }
+}
+
+static void unheard_routers(const snapshot_group &group, reason_list *list) {
+    if (has_reason(group, {"interface-missing", "interface-down", "interface-no-address", "port-taken",
+                           "socket-failed", "join-failed"}))
+        return;
+    for (const snapshot_router &router : group.routers) {
+        const bool explained = std::any_of(group.reasons.begin(), group.reasons.end(),
+                                           [&](const auto &each) { return each.sender == router.address; });
+        if (router.connection != "none" || explained)
+            continue;
+        list->add_state("no-answer", group, router.address,
+                        std::to_string(group.here_i_ams) + " Here-I-Am sent");
+        list->reasons.back().first_ms = static_cast<int64_t>(group.since_ms);
+    }
+}
+
+static std::string lowest_appliance(const snapshot_group &group) {
+    return group.appliances.empty() ? "" : group.appliances.front().address; // they are sorted
+}
+
+static void group_without_traffic(const snapshot_group &group, reason_list *list) {
+    const bool two_way = std::any_of(group.routers.begin(), group.routers.end(),
+                                     [](const auto &router) { return router.connection == "two-way"; });
+    std::string others;
+    for (const snapshot_appliance &one : group.appliances)
+        if (!one.self && one.most_percent > 0)
+            others +=
+                (others.empty() ? "" : ", ") + one.address + " " + std::to_string(one.most_percent) + "%";
+    if (group.state == "BACKUP")
+        list->add_state(group.weight == 0 ? "weight-zero" : "redirected-elsewhere", group, "", others);
+    else if (group.state == "INIT" && two_way && !has_reason(group, {"election-blocked", "table-not-built"}))
+        list->add_state("waiting-assignment", group, "",
+                        (group.designated ? "this appliance" : lowest_appliance(group)) + " is designated");
+    if (group.state != "INIT" && !group.designated && !lowest_appliance(group).empty() &&
+        lowest_appliance(group) != group.address)
+        list->add_state("not-designated", group, lowest_appliance(group), "");
+}
+
+// What a running group follows only when it is started again.
+static void changes_not_followed(const snapshot_group &group, reason_list *list) {
+    for (const snapshot_router &router : group.routers) {
+        const bool encap = !router.forward.empty() && !group.encap.empty() && group.encap != "either" &&
+                           group.encap != router.forward;
+        const bool assign = !router.assign.empty() && !group.assign_method.empty() &&
+                            group.assign_method != "either" && group.assign_method != router.assign;
+        if (!encap && !assign)
+            continue;
+        list->add_state("restart-needed", group, router.address,
+                        encap ? "forwarding by " + router.forward : "assignment by " + router.assign,
+                        encap ? group.encap : group.assign_method);
+        return;
+    }
+}
+
+static void group_reasons(const snapshot &shown, const snapshot_group &group, reason_list *list) {
+    if (group.admin == "down") {
+        list->add_state("disabled", group, "", "");
+        add_noted(group.reasons, group.id, list);
+        return;
+    }
+    if (group.configured && group.interface.empty())
+        list->add_state("no-interface", group, "", "");
+    else if (group.configured && group.routers_configured == 0)
+        list->add_state("no-router", group, "", "");
+    else if (!group.running && shown.wccpd == wccpd_condition::running &&
+             !shown.traffic.left.contains(group.id))
+        list->add_state("not-taken", group, "", "");
+    if (!group.running)
+        return;
+    if (!group.configured)
+        list->add_state("not-configured", group, "", "");
+    add_noted(group.reasons, group.id, list);
+    if (shown.brief)
+        return;
+    unheard_routers(group, list);
+    group_without_traffic(group, list);
+    changes_not_followed(group, list);
+    const bool sorts = shown.traffic.tunneld == tunneld_condition::running && shown.traffic.plane != "table";
+    const bool intercepted =
+        std::any_of(shown.traffic.intercepts.begin(), shown.traffic.intercepts.end(),
+                    [&](const traffic_intercept &each) { return each.group == group.id; });
+    if (sorts && !intercepted && group.state == "ACTIVE")
+        list->add_state("no-intercept", group, "", "");
+}
+
+static void traffic_of(const snapshot &shown, reason_list *list) {
+    for (const traffic_reason &each : traffic_reasons(shown.traffic)) {
+        reason *made = list->add(each.word.c_str(), each.group);
+        made->cause = each.text;
+        const std::string own = "group " + std::to_string(each.group) + ": ";
+        if (made->cause.starts_with(own))
+            made->cause.erase(0, own.size());
+        for (const traffic_intercept &intercept : shown.traffic.intercepts)
+            if (intercept.group == each.group && each.word == "proxy-down")
+                made->first_ms = static_cast<int64_t>(intercept.proxy_ms);
+    }
+}
+
+std::vector<reason> reasons_of(const snapshot &shown) {
+    reason_list list;
+    if (!shown.unreachable.empty()) {
+        list.add("mgmtd-unreachable", -1)->offered = shown.unreachable;
+    } else {
+        if (shown.wccpd != wccpd_condition::running)
+            list.add(shown.wccpd == wccpd_condition::absent ? "wccpd-absent" : "wccpd-silent", -1);
+        if (shown.traffic.tunneld != tunneld_condition::running)
+            list.add(shown.traffic.tunneld == tunneld_condition::absent ? "tunneld-absent" : "tunneld-silent",
+                     -1);
+        add_noted(shown.reasons, -1, &list);
+        for (const snapshot_group &group : shown.groups)
+            group_reasons(shown, group, &list);
+        traffic_of(shown, &list);
+    }
+    for (reason &each : list.reasons) {
+        const reason_text *text = find_reason_text(each.code);
+        if (text && each.cause.empty())
+            each.cause = filled(text->cause, each);
+        else if (each.cause.empty())
+            each.cause = each.code + (each.who.empty() ? "" : " of " + each.who);
+        each.next = filled(text ? text->next : "look at the log of wccpd and tunneld", each);
+        each.attention = !text || text->attention;
+    }
+    std::stable_sort(list.reasons.begin(), list.reasons.end(), [](const reason &a, const reason &b) {
+        return a.group != b.group ? a.group < b.group : place_of(a.code) < place_of(b.code);
+    });
+    return std::move(list.reasons);
+}
+
+const reason *main_reason(const std::vector<reason> &reasons, int group) {
+    const auto found = std::find_if(reasons.begin(), reasons.end(), [&](const reason &each) {
+        return each.group == group && each.attention;
+    });
+    return found == reasons.end() ? nullptr : &*found;
+}
+
+std::string reason_times(const reason &one) {
+    const auto ago = [](int64_t ms) { return duration_text(static_cast<uint64_t>(ms)) + " ago"; };
+    if (one.count == 0)
+        return one.first_ms < 0 ? "" : "for " + duration_text(static_cast<uint64_t>(one.first_ms));
+    if (one.count == 1)
+        return one.last_ms < 0 ? "" : "once, " + ago(one.last_ms);
+    return std::to_string(one.count) + " times, first " + ago(std::max<int64_t>(one.first_ms, 0)) +
+           ", last " + ago(std::max<int64_t>(one.last_ms, 0));
+}
+
+std::string reason_table_markdown() {
+    std::string out = "| reason | cause | cure |\n|---|---|---|\n";
+    const std::map<std::string, std::string> words = {
+        {"{who}", "ADDRESS"}, {"{offered}", "VALUE"}, {"{wanted}", "VALUE"}, {"{group}", "GROUP"}};
+    for (const reason_text &row : reason_texts()) {
+        std::string line = std::string("| `") + row.code + "`" + (row.attention ? "" : " (no fault)") +
+                           " | " + row.cause + " | " + row.next + " |\n";
+        for (const auto &[name, word] : words)
+            for (size_t at = 0; (at = line.find(name, at)) != std::string::npos; at += word.size())
+                line.replace(at, name.size(), word);
+        out += line;
+    }
+    return out;
+}
