@@ -225,9 +225,36 @@ expect 0 100 get $G/weight
 lab_wait_event 60 a1 '^alarm cleared: .*51' || fail "the alarm stays"
 expect 0 '[[]]' --json alarms --check
 
+# --- Several things broken on purpose
+
+explains() { # GROUP CODE WORDS : within some seconds the first reason of the group, with its cause
+    lab_wait 20 "[.reasons[] | select(.group == $1 and .attention)][0] | .reason == \"$2\" and (.cause | contains(\"$3\"))" \
+        ctl --json explain "$1" || fail "explain $1 does not say $2: $3"
+}
+expect 0 '*nothing needs attention*' explain 51
+for broken in 'set 51 password falsch' 'add 60 interface eth9 router 10.0.0.1' 'add 61 interface eth0 router 10.0.0.77' 'add 62'; do
+    # shellcheck disable=SC2086
+    ctl group $broken >/dev/null || fail "mgmtd refuses group $broken"
+done
+explains 51 password-mismatch '10.0.0.1 signs its messages with another password'
+explains 60 interface-missing 'no interface eth9'
+explains 61 no-answer '10.0.0.77 does not answer'
+explains 62 no-interface 'has no interface'
+expect 1 '*group 51 *password-mismatch: *[0-9] ago*next: *' explain
+expect 0 '*no interface eth9*> create it, or mgmtctl group set 60 interface NAME*' show
+ctl set $G/password '' >/dev/null
+explains 51 security-unwanted 'the group has no password'
+ctl set $G/password geheim >/dev/null
+for broken in 60 61 62; do ctl group delete $broken >/dev/null; done
+lab_wait 20 '.attention == false' ctl --json explain 51 || fail "a reason stays"
+expect 2 '' explain 300
+
 # --- wccpd stopped, mgmtd killed
 
 kill -STOP "$(lab_pid a1 wccpd)"
+expect 3 '*wccpd does not answer*alarms unknown*' show
+expect 3 '*wccpd-silent*' alarms --check
+expect 1 'jq:.reasons[0].reason == "wccpd-silent"' --json explain
 ctl walk /qv >"$LAB/walked" 2>&1 &
 walk=$!
 expect 3 '' get $S/oper
