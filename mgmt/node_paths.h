@@ -41,6 +41,7 @@
 #define NODE_ROLES NODE_ALARM_STATE "/role"           // by group
 #define NODE_LEFT_GROUPS NODE_ALARM_STATE "/left"     // out of their routers for a time, by group
 #define NODE_DRAINS NODE_ALARM_STATE "/drain"         // being emptied, or out, because an operator asked
+#define NODE_PROCESSES NODE_ALARM_STATE "/process"    // the daemons, by name
 
 #define NODE_CONFIG_STATE "/mgmtd/config/state"
 #define NODE_CONFIG_TEXT NODE_CONFIG_STATE "/text" // the configuration as its file has it

@@ -71,6 +71,9 @@ int ctl_history(const ctl_options &options);
 int ctl_diff(const ctl_options &options, uint32_t from, uint32_t to);
 int ctl_rollback(const ctl_options &options, uint32_t number);
 
+// Metrics: to standard output, or the answer to an HTTP request there (metrics_http.cpp).
+int ctl_metrics(const ctl_options &options, bool text, bool http);
+
 // The whole appliance (show.cpp).
 int ctl_show(const ctl_options &options);
 // Why the group, or everything (-1), does not work (explain.cpp). 0: nothing needs attention, 1: something

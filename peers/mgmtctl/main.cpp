@@ -104,7 +104,8 @@ struct command_line {
     std::function<int()> run;
     std::vector<std::string> words;
     std::string name = "/";
-    bool children = false, leaves = false, existing = false, check = false, list = false;
+    bool children = false, leaves = false, existing = false, check = false, list = false, text = false,
+         http = false;
     int group = -1;
     uint64_t count = 0;
     ctl_apply_options apply;
@@ -257,6 +258,13 @@ static void add_explain_command(command_line *line) {
     command->add_flag("--list", line->list, "every reason that there can be, as a table");
 }
 
+static void add_metrics_command(command_line *line) {
+    CLI::App *command = add_command(line, "metrics", "counters and states for a monitoring system",
+                                    [line] { return ctl_metrics(line->options, line->text, line->http); });
+    command->add_flag("--text", line->text, "in the older text format, for a textfile collector");
+    command->add_flag("--http", line->http, "answer the HTTP request on standard input");
+}
+
 static void add_shell_command(command_line *line) {
     CLI::App *command = add_command(
         line, "complete", "", [line] { return ctl_complete(line->words.empty() ? "" : line->words[0]); });
@@ -281,6 +289,7 @@ int main(int argc, char **argv) {
     add_drain_command(&line);
     add_show_command(&line);
     add_explain_command(&line);
+    add_metrics_command(&line);
     add_shell_command(&line);
 
     take_signals();

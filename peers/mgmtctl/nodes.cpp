@@ -42,10 +42,10 @@ static const std::vector<node_name> &patterns() {
         for (const auto *states : {&wccpd_state_nodes(), &tunneld_state_nodes()})
             for (const char *pattern : *states)
                 made.push_back(parsed_name(pattern));
-        for (const char *pattern : {NODE_ALARMS_RAISED "/*/*/name", NODE_ALARMS_RAISED "/*/*/since",
-                                    NODE_ALARMS_RAISED "/*/*/reporter", NODE_ROLES "/*/code",
-                                    NODE_ROLES "/*/since", NODE_LEFT_GROUPS "/*", NODE_CONFIG_TEXT,
-                                    NODE_COMMITS "/*/text"})
+        for (const char *pattern :
+             {NODE_ALARMS_RAISED "/*/*/name", NODE_ALARMS_RAISED "/*/*/since",
+              NODE_ALARMS_RAISED "/*/*/reporter", NODE_ROLES "/*/code", NODE_ROLES "/*/since",
+              NODE_LEFT_GROUPS "/*", NODE_CONFIG_TEXT, NODE_COMMITS "/*/text", NODE_PROCESSES "/*"})
             made.push_back(parsed_name(pattern));
         return made;
     }();

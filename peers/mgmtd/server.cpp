@@ -296,6 +296,7 @@ void server_peer_opened(server *self, uint32_t peer_id, const std::string &name,
     who.owner = owner;
     who.first_seen = ++self->peers_seen;
     self->say("session of " + name + " open");
+    server_note_process(self, name);
     if (self->opened)
         self->opened(name);
 }
@@ -309,6 +310,7 @@ void server_peer_closed(server *self, uint32_t peer_id) {
     self->peers.erase(found);
     if (self->closed)
         self->closed(name);
+    server_note_process(self, name);
     std::vector<pending_query> left;
     for (auto at = self->pending.begin(); at != self->pending.end();) {
         const auto query = at++;

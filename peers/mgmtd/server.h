@@ -177,6 +177,9 @@ node_value server_time_now();
 // Takes a node of `state` out, with those below it.
 void server_remove_report(server *self, const node_name &root);
 
+// A session has opened or closed: what it says of its daemon, in processes.cpp.
+void server_note_process(server *self, const std::string &session);
+
 // Groups that are out of their routers, in left_groups.cpp.
 void server_take_leave(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
 void server_take_join(server *self, uint32_t peer_id, const std::vector<event_field> &fields);

@@ -1,0 +1,81 @@
+// "mgmtctl metrics": to standard output, or as the answer to one HTTP request (RFC 9112) that a socket unit
+// has accepted.
+#include <cerrno>
+#include <cstring>
+
+#include <poll.h>
+#include <unistd.h>
+
+#include "peers/mgmtctl/commands.h"
+#include "peers/mgmtctl/link.h"
+#include "peers/mgmtctl/metrics.h"
+#include "peers/mgmtctl/render.h"
+#include "runtime/ttime.h"
+
+static constexpr size_t REQUEST_MAX = 8192;
+static constexpr int64_t REQUEST_MS = 5000;
+
+// The request with its headers, or what has come of it when the time or the room is over.
+static std::string read_request() {
+    std::string request;
+    const int64_t until = lt_monotonic_ms() + REQUEST_MS;
+    while (request.size() < REQUEST_MAX && request.find("\r\n\r\n") == std::string::npos) {
+        pollfd in = {STDIN_FILENO, POLLIN, 0};
+        const int64_t left = until - lt_monotonic_ms();
+        if (left <= 0 || poll(&in, 1, static_cast<int>(left)) <= 0)
+            break;
+        char some[1024];
+        const ssize_t got = read(STDIN_FILENO, some, sizeof some);
+        if (got <= 0)
+            break;
+        request.append(some, static_cast<size_t>(got));
+    }
+    return request;
+}
+
+static int answer_request(const char *status, const char *type, const std::string &body, bool with_body,
+                          int code) {
+    put("HTTP/1.1 " + std::string(status) + "\r\nContent-Type: " + type + "\r\nContent-Length: " +
+        std::to_string(body.size()) + "\r\nConnection: close\r\n\r\n" + (with_body ? body : ""));
+    return code;
+}
+
+static ctl_ask asking(const ctl_link &link) {
+    return [link](ctl_walk walk, const std::string &name, ctl_reply *out) {
+        std::string reason;
+        return link.query(walk, name, out, &reason);
+    };
+}
+
+int serve_metrics_request(const ctl_link &link) {
+    static constexpr char PLAIN[] = "text/plain; charset=utf-8";
+    const std::string request = read_request();
+    const size_t end = request.find("\r\n");
+    if (end == std::string::npos || request.find("\r\n\r\n") == std::string::npos)
+        return answer_request("400 Bad Request", PLAIN, "no complete request\n", true, CTL_USAGE);
+    const std::string first = request.substr(0, end);
+    const bool head = first.starts_with("HEAD ");
+    if (!head && !first.starts_with("GET "))
+        return answer_request("405 Method Not Allowed", PLAIN, "GET and HEAD only\n", true, CTL_USAGE);
+    const size_t from = first.find(' ') + 1, to = first.find(' ', from);
+    if (first.substr(from, to - from) != "/metrics")
+        return answer_request("404 Not Found", PLAIN, "the metrics are at /metrics\n", !head, CTL_USAGE);
+    const metric_format format = request.find("application/openmetrics-text") != std::string::npos
+                                     ? metric_format::openmetrics
+                                     : metric_format::text;
+    // A mgmtd that does not answer is what the samples say then.
+    std::vector<metric_sample> samples;
+    (void)gather_metrics(asking(link), &samples);
+    return answer_request("200 OK", metrics_content_type(format), metrics_text(samples, format), !head,
+                          CTL_OK);
+}
+
+int ctl_metrics(const ctl_options &options, bool text, bool http) {
+    const ctl_link link = link_to_mgmtd(options);
+    if (http)
+        return serve_metrics_request(link);
+    std::vector<metric_sample> samples;
+    const bool answered = gather_metrics(asking(link), &samples);
+    put(metrics_text(samples, text ? metric_format::text : metric_format::openmetrics));
+    return answered ? CTL_OK : CTL_UNREACHABLE;
+}
