@@ -246,6 +246,10 @@ const char *wccp_counter_word(uint32_t index) {
     return index < sizeof counter_rows / sizeof *counter_rows ? counter_rows[index].word : nullptr;
 }
 
+uint32_t wccp_read_counter(const wccp_service_group *group, uint32_t index) {
+    return group->*counter_rows[index].member;
+}
+
 int wccp_get_counter(int id, const char *word, uint32_t *out) {
     if (!word || !out)
         return 1;

@@ -76,7 +76,8 @@ int wccp_get_reason_list(int id, wccp_reason_list *list);
 int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info);
 // The word of a counter, by its place in their table from 0; null past the last.
 const char *wccp_counter_word(uint32_t index);
-int wccp_get_counter(int id, const char *word, uint32_t *out); // also 1 for a word that is none
+uint32_t wccp_read_counter(const wccp_service_group *group, uint32_t index); // of a word there is; lock held
+int wccp_get_counter(int id, const char *word, uint32_t *out);               // also 1 for a word that is none
 // By its place from 0; 1 past the last.
 int wccp_get_interface_info(uint32_t index, wccp_interface_info *info);
 

@@ -1,0 +1,64 @@
+#include "engine/wccp_metrics.h"
+
+#include "engine/wccp_debug_pieces.h"
+#include "engine/wccp_query.h"
+#include "engine/wccp_reasons.h"
+#include "engine/wccp_utils.h"
+
+namespace {
+
+int print_group_numbers(const wccp_service_group *group, wccp_piece *piece) {
+    const bool timed = (group->state_flags & (WCCP_STATE_ACTIVE | WCCP_STATE_BACKUP)) != 0;
+    wccp_piece_add(piece, "group %d %d %u %u %u %u\n", (group->state_flags & WCCP_STATE_ACTIVE) != 0,
+                   group->designated == 1, timed ? wccp_g.seconds - group->state_time : 0,
+                   group->sending_router_count, group->appliance_view_count, group->pending_acks);
+    return wccp_piece_flush(piece);
+}
+
+int print_counters(const wccp_service_group *group, wccp_piece *piece) {
+    for (uint32_t i = 0; wccp_counter_word(i); i++)
+        wccp_piece_add(piece, "counter %s %u\n", wccp_counter_word(i), wccp_read_counter(group, i));
+    return wccp_piece_flush(piece);
+}
+
+int print_router_numbers(const wccp_sending_router *router, wccp_piece *piece) {
+    wccp_piece_add(piece, "router %s %s %d %u %u %u %u\n", addr_text(router->router_id).s,
+                   addr_text(router->src_ipa).s, (router->flags & WCCP_RTR_TWO_WAY) != 0,
+                   wccp_g.seconds - router->last_icu_time, wccp_g.seconds - router->state_time,
+                   router->self_buckets, router->total_buckets);
+    return wccp_piece_flush(piece);
+}
+
+int print_reasons(wccp_service_group *group, wccp_piece *piece) {
+    uint32_t places;
+    const wccp_reason *const table = wccp_reasons_of(group, &places);
+    for (uint32_t i = 0; i < places; i++) {
+        if (table[i].code == WCCP_REASON_NONE)
+            continue;
+        wccp_piece_add(piece, "reason %s %s %u %u\n", wccp_reason_word(table[i].code),
+                       addr_text(table[i].sender).s, table[i].count, wccp_g.seconds - table[i].last);
+        WCCP_BAIL_ON_ZERO(wccp_piece_flush(piece));
+    }
+    return 0;
+}
+
+} // namespace
+
+int wccp_print_metrics(int id, csys_display_buf *buffer) {
+    if (!buffer)
+        return 1;
+    const wccp_engine_lock lock;
+    wccp_service_group *group = wccp_find_group(id);
+    if (!group)
+        return 1;
+    wccp_piece piece = wccp_assignment_piece(buffer);
+    WCCP_BAIL_ON_ZERO(print_group_numbers(group, &piece));
+    WCCP_BAIL_ON_ZERO(print_counters(group, &piece));
+    for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
+        WCCP_BAIL_ON_ZERO(print_router_numbers(router, &piece));
+    for (const wccp_view_appliance *member = group->appliance_view; member; member = member->next) {
+        wccp_piece_add(&piece, "appliance %s %u\n", addr_text(member->ipa).s, member->weight);
+        WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
+    }
+    return print_reasons(group, &piece);
+}
