@@ -170,7 +170,8 @@ void let_links_linger(tunneld *daemon) {
         const tunnel_ends ends = {link.wish.local, link.wish.remote};
         const bool known = std::any_of(daemon->lingering.begin(), daemon->lingering.end(),
                                        [&](const lingering_link &each) { return each.tunnel.ends == ends; });
-        if (daemon->active_ms >= 0 && !link.wish.accepted && !known && !has_ends(daemon->desk, ends))
+        if (daemon->active_ms >= 0 && link.wish.kind == link_kind::tunnel && !known &&
+            !has_ends(daemon->desk, ends))
             daemon->lingering.push_back(
                 {{free_tunnel_id(daemon->desk, link.wish.tunnel_id), ends}, until_ms});
     }

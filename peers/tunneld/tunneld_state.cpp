@@ -36,8 +36,9 @@ void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorti
     for (const wanted_link &link : daemon.links) {
         const auto index = daemon.indices.find(link.name);
         const auto ordered = daemon.desk.tunnels.find(link.wish.tunnel_id);
-        if (link.wish.kind != link_kind::tunnel || index == daemon.indices.end() || ordered == daemon.desk.tunnels.end() ||
-            ordered->second.local != link.wish.local || ordered->second.remote != link.wish.remote)
+        if (link.wish.kind != link_kind::tunnel || index == daemon.indices.end() ||
+            ordered == daemon.desk.tunnels.end() || ordered->second.local != link.wish.local ||
+            ordered->second.remote != link.wish.remote)
             continue;
         const std::string id = std::to_string(link.wish.tunnel_id);
         node_writer writer = {out, std::string(NODE_TUNNEL_STATE) + "/" + id};
