@@ -222,7 +222,9 @@ int ctl_export(const ctl_options &options) {
     uint32_t revision = 0;
     if (!get_present(&mgmtd, &present, &revision))
         return mgmtd.code;
-    put(options.json ? export_json(present.tree, options.secrets).dump(2, ' ', true) + "\n"
+    put(options.json ? export_json(present.tree, options.secrets)
+                               .dump(2, ' ', true, ctl_json::error_handler_t::replace) +
+                           "\n"
                      : export_text(present, options.secrets));
     return CTL_OK;
 }
