@@ -277,7 +277,7 @@ case_fleet() {
     lab_group 51 10.0.0.1 weight=7 >"$file"
     FLEET_HEALTH=false fleet 1 $'a2: is not well, and undoes the change in 5 minutes; halted, not yet reached: a3' --merge "$file" a2 a3
     lab_in a2 "$WCCP_BIN/mgmtctl" confirm >/dev/null || die "a2 does not wait"
-    fleet 1 "a3: modify /qv/wccpd/wccp/srv_grp/config/51/weight = 7 (was 100)" --check --merge "$file" a2 a3
+    fleet 1 "a2: nothing to change"$'\n'"a3: modify /qv/wccpd/wccp/srv_grp/config/51/weight = 7 (was 100)" --check --merge "$file" a2 a3
     fleet 0 $'a2: unchanged\na3: changed' --merge "$file" a2 a3
     fleet 0 $'a2: nothing to change\na3: nothing to change' --check --merge "$file" a2 a3
 }
