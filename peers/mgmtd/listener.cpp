@@ -153,10 +153,14 @@ void listener_tidy(const listener *self) {
 
 // --- The socket
 
+// A process of that group needs no privilege for it: its socket is the group's already.
 static void admit_viewers(listener *self) {
+    struct stat about;
     if (self->viewers == static_cast<gid_t>(-1))
         return;
-    if (chown(self->path.c_str(), static_cast<uid_t>(-1), self->viewers) == 0 &&
+    if (lstat(self->path.c_str(), &about) == 0 &&
+        (about.st_gid == self->viewers ||
+         chown(self->path.c_str(), static_cast<uid_t>(-1), self->viewers) == 0) &&
         chmod(self->path.c_str(), 0660) == 0)
         return;
     self->say("group " + self->viewers_group + " can't be let in: " + strerror(errno));
