@@ -161,7 +161,7 @@ if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
     as=(setpriv --reuid 65534 --regid 65534 --groups "$(getent group wccpd | cut -d: -f3 | grep . || echo 2999)")
     expect 0 100 get $G/weight
     expect 0 'jq:.groups[0].password' --json show
-    for words in "get $G/password" 'walk /' "get $S/debug" export 'export --json' "get /mgmtd/config/state/text" 'diff 1'; do
+    for words in "get $G/password" 'walk /' "get $S/debug" export 'export --json' "get /mgmtd/config/state/text" 'diff 1 2'; do
         # shellcheck disable=SC2086
         ctl $words --secrets >"$LAB/said" 2>"$LAB/complained" && [ -s "$LAB/said" ] && ! grep -q geheim "$LAB/said" ||
             fail "a viewer's $words"
