@@ -98,6 +98,9 @@ TEST(Groups, OneCommitWhereARunningGroupFollows) {
     mgmtd.nodes[ROOT + "/weight"] = "7";
     EXPECT_EQ(mgmtd.run({"set", "51", "weight", "default"}).commits, 1);
     EXPECT_EQ(mgmtd.sent(0), "reset /weight=;");
+    EXPECT_EQ(mgmtd.run({"set", "51", "encap", "l2", "assign", "mask", "weight", "8"}).note,
+              "a group that runs follows a change of assign, encap when it is started again: "
+              "mgmtctl group restart 51");
 }
 
 TEST(Groups, AsAWholeItIsOneCommitAsWell) {

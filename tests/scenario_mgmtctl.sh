@@ -78,7 +78,7 @@ expect 0 'jq:
     (map({key: .name, value: .}) | from_entries) as $n | (map(select(.name | test("/(counter|reason)/") | not) | [.name, .type]) | sort) == ([
         ["", "string"], ["/oper", "string"], ["/uptime", "duration_ms"], ["/app_id", "string"],
         ["/num_routers", "uint32"], ["/num_appliances", "uint32"], ["/debug", "string"], ["/assignment", "string"],
-        ["/since", "duration_ms"], ["/pending_acks", "uint32"], ["/router/1/heard", "duration_ms"],
+        ["/since", "duration_ms"], ["/owners", "string"], ["/pending_acks", "uint32"], ["/router/1/heard", "duration_ms"],
         ["/router/1", "string"], ["/router/1/state", "string"], ["/router/1/fwd_method", "string"],
         ["/router/1/ret_method", "string"], ["/router/1/assign_method", "string"], ["/router/1/id", "ipv4addr"],
         ["/router/1/ipaddr", "ipv4addr"], ["/router/1/conn_time", "duration_ms"],
@@ -149,7 +149,7 @@ ctl bypass add 10.0.0.0/8 >/dev/null && ctl intercept add 51 all to 3128 >/dev/n
 [ "$(completed bypass delete 10.0.0.0/)" = 10.0.0.0/8 ] && [ "$(completed intercept set '')" = 51 ] &&
     [ "$(completed intercept set 51 ch)" = check ] && [ "$(completed intercept set 51 rest d)" = drop ] ||
     fail "the shell completes words of redirected traffic otherwise"
-expect 0 'jq:.intercepts[0] | .group == 51 and .active' --json intercept show 051
+lab_wait 20 '.intercepts[0] | .group == 51 and .active' ctl --json intercept show 051 || fail "the intercept is not active"
 ctl bypass delete 10.0.0.0/8 >/dev/null; ctl intercept delete 51 >/dev/null
 [ "$(completed al)" = alarms ] && [ "$(completed get "${G%1}")" = $G ] && [ "$(completed group set '')" = 51 ] &&
     [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&

@@ -221,6 +221,10 @@ static std::vector<ctl_change_item> router_changes(const std::string &root,
     return items;
 }
 
+// What a group agrees with its routers, or computes for them, once and keeps.
+static const std::string taken_at_start[] = {"encap",       "assign_method", "force_l2_return", "mask_src_ip",
+                                             "mask_dst_ip", "mask_src_port", "mask_dst_port"};
+
 static void group_set(const ctl_link &link, const std::string &root, const group_wish &wish,
                       group_result *inout) {
     group_nodes before;
@@ -228,7 +232,7 @@ static void group_set(const ctl_link &link, const std::string &root, const group
         return;
     group_nodes after = before;
     std::vector<ctl_change_item> items;
-    std::string as_whole;
+    std::string as_whole, at_start;
     if (wish.routers) {
         items = router_changes(root, group_routers(before), *wish.routers);
         put_routers(*wish.routers, &after);
@@ -249,6 +253,8 @@ static void group_set(const ctl_link &link, const std::string &root, const group
         else
             after.erase(node);
         items.push_back({value ? ctl_change::modify : ctl_change::reset, {name, "", value ? *to : ""}});
+        if (std::count(std::begin(taken_at_start), std::end(taken_at_start), node) > 0)
+            at_start += std::string(at_start.empty() ? "" : ", ") + word->word;
         if (word->whole || (!value && !fallback))
             as_whole += std::string(as_whole.empty() ? "" : ", ") + word->word;
     }
@@ -258,6 +264,9 @@ static void group_set(const ctl_link &link, const std::string &root, const group
         return;
     } else if (as_whole.empty()) {
         inout->done = "changed";
+        if (!at_start.empty())
+            inout->note = "a group that runs follows a change of " + at_start +
+                          " when it is started again: mgmtctl group restart " + std::to_string(inout->number);
     } else {
         const std::string lack = what_it_lacks(after);
         inout->done = "recreated";

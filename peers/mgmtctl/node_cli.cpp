@@ -164,7 +164,7 @@ static bool explain_alarms(connection *mgmtd, std::vector<ctl_alarm> *inout, boo
     const std::vector<reason> reasons = reasons_of(shown);
     for (ctl_alarm &alarm : *inout)
         for (const snapshot_alarm &each : shown.alarms) {
-            const reason *cause = each.group >= 0 ? main_reason(reasons, each.group) : nullptr;
+            const reason *cause = alarm_reason(reasons, each.group, each.name);
             if (cause && alarm.source == each.source && alarm.name == each.name) {
                 alarm.reason = cause->code;
                 alarm.cause = "group " + std::to_string(each.group) + ": " + cause->cause;

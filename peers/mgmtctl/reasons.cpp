@@ -314,9 +314,10 @@ static void traffic_of(const snapshot &shown, reason_list *list) {
     for (const traffic_reason &each : traffic_reasons(shown.traffic)) {
         reason *made = list->add(each.word.c_str(), each.group);
         made->cause = each.text;
-        const std::string own = "group " + std::to_string(each.group) + ": ";
-        if (made->cause.starts_with(own))
-            made->cause.erase(0, own.size());
+        for (const char *end : {": ", " "}) // the group is named beside the cause
+            if (const std::string own = "group " + std::to_string(each.group) + end;
+                made->cause.starts_with(own))
+                made->cause.erase(0, own.size());
         for (const traffic_intercept &intercept : shown.traffic.intercepts)
             if (intercept.group == each.group && each.word == "proxy-down")
                 made->first_ms = static_cast<int64_t>(intercept.proxy_ms);
@@ -356,6 +357,17 @@ std::vector<reason> reasons_of(const snapshot &shown) {
 const reason *main_reason(const std::vector<reason> &reasons, int group) {
     const auto found = std::find_if(reasons.begin(), reasons.end(), [&](const reason &each) {
         return each.group == group && each.attention;
+    });
+    return found == reasons.end() ? nullptr : &*found;
+}
+
+const reason *alarm_reason(const std::vector<reason> &reasons, int group, const std::string &alarm) {
+    if (group < 0)
+        return nullptr;
+    if (alarm == "adjacency" || alarm == "assignment")
+        return main_reason(reasons, group);
+    const auto found = std::find_if(reasons.begin(), reasons.end(), [&](const reason &each) {
+        return each.group == group && each.code == alarm;
     });
     return found == reasons.end() ? nullptr : &*found;
 }

@@ -32,6 +32,8 @@ struct reason {
 std::vector<reason> reasons_of(const snapshot &shown);
 // The one to begin with; null when nothing of the group needs attention.
 const reason *main_reason(const std::vector<reason> &reasons, int group);
+// What an alarm of a group comes from; null: unknown.
+const reason *alarm_reason(const std::vector<reason> &reasons, int group, const std::string &alarm);
 // "4 times, first 0:01:10 ago, last 0:00:03 ago", or since when; "" where no time is known.
 std::string reason_times(const reason &one);
 // The table as rows of docs/operations.md.

@@ -102,7 +102,7 @@ static std::string alarm_words(const snapshot_alarm &alarm, const std::vector<re
     std::string text = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": " : alarm.source + ": ";
     const auto *row = std::find_if(std::begin(known), std::end(known),
                                    [&](const auto &each) { return alarm.name == each.name; });
-    const reason *cause = alarm.group >= 0 ? main_reason(reasons, alarm.group) : nullptr;
+    const reason *cause = alarm_reason(reasons, alarm.group, alarm.name);
     text += cause ? cause->cause : row != std::end(known) ? row->words : alarm.text;
     return alarm.since.empty() ? text : text + ", since " + alarm.since;
 }
