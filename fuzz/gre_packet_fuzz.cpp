@@ -13,6 +13,7 @@
 
 #include "peers/tunneld/coalesce.h"
 #include "peers/tunneld/gre.h"
+#include "peers/tunneld/passing.h"
 
 namespace {
 
@@ -177,6 +178,20 @@ bytes in_outer_packet(const bytes &gre) {
     return out;
 }
 
+// Each service passes all that it may on to a member of its own.
+const passing_lookup &passing() {
+    static const passing_lookup *const lookup = [] {
+        passing_table table;
+        for (uint32_t service = 0; service < 256; service++)
+            table[static_cast<uint8_t>(service)] = {
+                1, service % 2 == 0, {}, std::vector<uint32_t>(256, service + 2)};
+        auto *made = new passing_lookup;
+        fill_passing_lookup(table, made);
+        return made;
+    }();
+    return *lookup;
+}
+
 // True when the packet that the frame carries has gone to the coalescer, from `frame`'s own memory.
 bool take_frame(coalescer *merger, exact_memory *frame) {
     gre_outer outer;
@@ -187,6 +202,14 @@ bool take_frame(coalescer *merger, exact_memory *frame) {
     if (read_gre_payload(outer.payload, outer.length, false, &content) != REFUSALS)
         return false;
     REQUIRE(ip4_is_valid(content.packet, content.length));
+    uint32_t local = 0;
+    if (const uint32_t member = find_passing_member(passing(), content, &local)) {
+        const auto *tcp = reinterpret_cast<const tcp_wire_header *>(
+            content.packet + ip4_header_length(*ip_of(content.packet)));
+        REQUIRE(content.has_redirect && local == 1 && member == content.redirect.service + 2u);
+        REQUIRE(ip_of(content.packet)->protocol == PROTOCOL_TCP &&
+                (tcp->flags & (TCP_SYN | TCP_ACK | TCP_RST | TCP_FIN)) != TCP_SYN);
+    }
     keep_packet(&taken, bytes(content.packet, content.packet + content.length));
     coalesce_packet(merger, nullptr, content.packet, content.length);
     return true;

@@ -238,7 +238,7 @@ TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
     };
     snapshot_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
     std::vector<std::string> lines = draw_screen(gather_snapshot(query, limits), {79, 23, true, true, ""});
-    EXPECT_LE(asked, 14u + 23u * 7);
+    EXPECT_LE(asked, 16u + 23u * 7);
     ASSERT_EQ(lines.size(), 23u);
     EXPECT_NE(lines[1].find("routers 31/31  share 3%"), std::string::npos) << lines[1];
     EXPECT_NE(lines.back().find("and 235 groups not shown"), std::string::npos) << lines.back();
@@ -384,12 +384,13 @@ TEST(Show, EveryReasonHasWordsAndIsInTheDocuments) {
 
 // --- Redirected traffic
 
-// P, T, I, L: of the data plane, a tunnel, an intercept, a group that is out of its routers; X: an
-// intercept's configuration, A: an accepted source.
+// P, T, I, G, L: of the data plane, a tunnel, an intercept, protection, a group that is out of its routers;
+// X: an intercept's configuration, A: an accepted source.
 static void add_traffic(canned *from, const char *lines) {
     static const std::map<char, const char *> roots = {
         {'P', NODE_PLANE_STATE},         {'T', NODE_TUNNEL_STATE},     {'I', NODE_INTERCEPT_STATE},
-        {'L', NODE_ALARM_STATE "/left"}, {'X', NODE_INTERCEPT_CONFIG}, {'A', NODE_ACCEPT_CONFIG}};
+        {'L', NODE_ALARM_STATE "/left"}, {'X', NODE_INTERCEPT_CONFIG}, {'A', NODE_ACCEPT_CONFIG},
+        {'G', NODE_PROTECTION_STATE}};
     std::istringstream in(lines);
     for (std::string name, value; std::getline(in, name, ' ') && std::getline(in, value, '|');)
         from->add(std::string(roots.at(name[0])) + name.substr(1), value);
@@ -404,6 +405,8 @@ static const char *const TRAFFIC =
     "true|I/51/left true|"
     "I/51/in 120|I/51/in_bytes 9000|I/51/to_proxy 100|I/51/returned 12|I/51/down 8|"
     "I/52 52|I/52/proxy up|I/52/active false|I/52/in 99999|I/52/to_proxy 18446744073709551615|"
+    "G/time 300|G/passed 7|G/delivered 3|G/group/51 51|G/group/51/covered true|G/group/51/slots 128|"
+    "G/group/52 52|G/group/52/covered false|G/group/52/reason no bucket|G/member/10.0.0.102/passed 7|"
     "L/51 no good check for 30 s|L/51/since 2026/11/25 00:10:11|"
     "X/51 51|X/51/ports 80 443|X/51/to 3128|X/51/rest return|X/51/check http|X/51/check_argument /a|"
     "A/10.0.0.8 10.0.0.8|A/10.0.0.8/router 0.0.0.0|";
@@ -434,7 +437,9 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
     EXPECT_EQ(traffic["tunnels"][0]["in"]["bytes"], 999999999);
     EXPECT_EQ(traffic["intercepts"][1]["sorted"]["to_proxy"]["packets"], UINT64_MAX);
     EXPECT_EQ(traffic["left"].dump(), R"([{"group":51,"reason":"no good check for 30 s"}])");
-    EXPECT_EQ(traffic["reasons"].size(), 7u);
+    EXPECT_EQ(traffic["reasons"].size(), 8u);
+    EXPECT_EQ(traffic["protection"]["members"][0]["passed"], 7);
+    EXPECT_EQ(traffic["protection"]["groups"][0]["slots"], 128);
     EXPECT_EQ(traffic["lack"], "no tproxy");
     // A proxy that is down is a reason of its own only while the group is in its routers, and fragments only
     // while nothing is clamped; a source that is accepted by now is none.
@@ -470,6 +475,9 @@ TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
               "tunnel 3  10.0.0.101 to 10.0.0.1  on wccp0  index 12\n"
               "  in 1.2M (1.0G bytes)  out 0 (0 bytes)  fragments 4\n"
               "  sorted: in 7  to proxy 0  returned 0  own 3\n  refused by reason:  flags 2\n"
+              "protection of flows for 300 s\n  passed on 7  received 0  delivered 3  returned 0\n"
+              "  group 51  128 slots passed on\n  group 52  not covered: no bucket\n"
+              "  appliance 10.0.0.102  passed on 7  received 0  delivered 0  returned 0\n"
               "refused 9 from 10.0.0.9\naccepted 10.0.0.8\n"
               "all packets are returned: no tproxy\nthe kernel is not as wanted: wccp0: busy?\n"
               "the router redirects this appliance's own traffic\n"

@@ -26,6 +26,7 @@
 
 #include "peers/tunneld/coalesce.h"
 #include "peers/tunneld/gre.h"
+#include "peers/tunneld/passing.h"
 #include "peers/tunneld/plane.h"
 
 namespace {
@@ -151,6 +152,50 @@ TEST(gre, headers_are_taken_or_refused) {
         EXPECT_EQ(bytes(content.packet, content.packet + content.length), packet);
         EXPECT_EQ(content.has_redirect, row.has_redirect);
         EXPECT_TRUE(!row.has_redirect || memcmp(&content.redirect, redirect.data(), redirect.size()) == 0);
+    }
+}
+
+TEST(gre, buckets_choose_who_gets_a_packet) {
+    constexpr uint32_t MEMBER = 0x0a000066, HERE = 0x0a000065;
+    passing_table table;
+    table[51] = {HERE, false, {{79, 80}, {443, 443}}, std::vector<uint32_t>(256, 0)};
+    table[51].members[200] = MEMBER;
+    table[52] = {HERE, true, {}, std::vector<uint32_t>(256, MEMBER)};
+    EXPECT_EQ(read_passing_file(passing_file_text(table) + "51 10.0.0.1 source 80 257*0.0.0.0\n7 x\n"),
+              table);
+    passing_lookup lookup;
+    fill_passing_lookup(table, &lookup);
+    const struct {
+        const char *what;
+        bytes redirect; // flags, service, alternative and primary bucket
+        uint32_t member;
+        std::function<void(bytes *packet)> change = [](bytes *) {};
+    } rows[] = {
+        {"its bucket", {0x80, 51, 7, 200}, MEMBER},
+        {"the alternative bucket", {0xc0, 51, 200, 7}, MEMBER},
+        {"the other of the two", {0xc0, 51, 7, 200}, 0},
+        {"nobody's bucket", {0x80, 51, 200, 7}, 0},
+        {"another service", {0x80, 50, 200, 200}, 0},
+        {"another port", {0x80, 51, 7, 200}, 0, [](bytes *p) { tcp(p)->destination_port = to_be16(81); }},
+        {"from any port", {0x80, 52, 7, 200}, MEMBER, [](bytes *p) { tcp(p)->source_port = to_be16(0); }},
+        {"a new flow", {0x80, 51, 7, 200}, 0, [](bytes *p) { tcp(p)->flags = TCP_SYN; }},
+        {"its answer", {0x80, 51, 7, 200}, MEMBER, [](bytes *p) { tcp(p)->flags = TCP_SYN | TCP_ACK; }},
+        {"a fragment", {0x80, 51, 7, 200}, 0, [](bytes *p) { ip(p)->fragment = to_be16(0x2000); }},
+        {"a datagram", {0x80, 51, 7, 200}, 0, [](bytes *p) { ip(p)->protocol = PROTOCOL_UDP; }},
+        {"cut within its header", {0x80, 51, 7, 200}, 0, [](bytes *p) { p->resize(39); }},
+        {"no redirect header", {}, 0},
+    };
+    for (const auto &row : rows) {
+        SCOPED_TRACE(row.what);
+        bytes packet = make_packet(PROTOCOL_TCP, 1, 31);
+        row.change(&packet);
+        mend(&packet);
+        bytes payload = wrap(0, GRE_TYPE_REDIRECT, packet, row.redirect);
+        gre_content content;
+        ASSERT_EQ(read_gre_payload(payload.data(), payload.size(), false, &content), REFUSALS);
+        uint32_t local = 0;
+        EXPECT_EQ(find_passing_member(lookup, content, &local), row.member);
+        EXPECT_EQ(local, row.member ? HERE : 0);
     }
 }
 

@@ -70,6 +70,8 @@ int ctl_history(const ctl_options &options);
 // Numbers of commits; 0 for one that wasn't given.
 int ctl_diff(const ctl_options &options, uint32_t from, uint32_t to);
 int ctl_rollback(const ctl_options &options, uint32_t number);
+// How long the flows of slots that have moved are passed on to those who have them: "protection time 300".
+int ctl_protection(const ctl_options &options, const std::vector<std::string> &words);
 
 // Metrics: to standard output, or the answer to an HTTP request there (metrics_http.cpp).
 int ctl_metrics(const ctl_options &options, bool text, bool http);

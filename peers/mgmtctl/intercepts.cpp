@@ -271,3 +271,25 @@ traffic_result tunnel_command(const ctl_link &link, const std::vector<std::strin
            &result);
     return result;
 }
+
+// --- Protection of flows
+
+traffic_result protection_command(const ctl_link &link, const std::vector<std::string> &words) {
+    traffic_result result;
+    result.kind = "protection";
+    if (words[0] != "time")
+        return failed(result, CTL_USAGE, unknown_word_text(words[0], {"time"}));
+    const int64_t seconds = words.size() == 2 ? number_of<int64_t>(words[1], -1) : -1;
+    if (seconds < 0 || std::to_string(seconds) != words[1])
+        return failed(result, CTL_USAGE, "protection [time SECONDS]; 0 switches it off");
+    result.subject = "time";
+    ctl_reply reply;
+    if (!ask(link, ctl_walk::node, NODE_PROTECTION_TIME, &reply, &result))
+        return result;
+    const bool same = !reply.bindings.empty() && reply.bindings[0].value == words[1];
+    commit(link,
+           same ? std::vector<ctl_change_item>{}
+                : std::vector<ctl_change_item>{{ctl_change::create, {NODE_PROTECTION_TIME, "", words[1]}}},
+           "changed", &result);
+    return result;
+}

@@ -9,7 +9,7 @@
 
 struct traffic_result {
     int exit = CTL_OK;
-    const char *kind = ""; // "intercept", "bypass", "source"
+    const char *kind = ""; // "intercept", "bypass", "source", "protection"
     std::string subject;   // a group's number, a prefix, an address; empty: none was understood
     std::string done;  // "added", "accepted", "changed", "deleted", "refused", "unchanged"; empty: nothing
     uint32_t code = 0; // of mgmtd's refusal
@@ -25,6 +25,7 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
 // `now` in seconds since 1970. mgmtd deletes a bypass whose time is over.
 traffic_result bypass_command(const ctl_link &link, const std::vector<std::string> &words, int64_t now);
 traffic_result tunnel_command(const ctl_link &link, const std::vector<std::string> &words);
+traffic_result protection_command(const ctl_link &link, const std::vector<std::string> &words); // not empty
 
 // `words` follow "drain"; it prints, and gives the exit code.
 int run_drain(const ctl_options &options, const ctl_link &link, const std::vector<std::string> &words);

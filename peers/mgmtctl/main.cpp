@@ -185,6 +185,9 @@ static void add_traffic_commands(command_line *line) {
     add_command(line, "tunnel", "tunnels and who may send into them: accept, refuse, show", [line] {
         return ctl_tunnel(line->options, line->words);
     })->add_option("WORD", line->words);
+    add_command(line, "protection", "flows whose appliance has changed: [time SECONDS]", [line] {
+        return ctl_protection(line->options, line->words);
+    })->add_option("WORD", line->words);
 }
 
 static void add_config_commands(command_line *line) {

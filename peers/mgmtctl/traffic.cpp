@@ -50,6 +50,19 @@ static const state_row<traffic_intercept> intercept_rows[] = {
      [](traffic_intercept *i, const std::string &v) { i->weight_percent = number_of<uint32_t>(v, 100); }},
 };
 
+static const state_row<protection_counts> protection_rows[] = {
+    {"passed", [](protection_counts *p, const std::string &v) { p->passed = number(v); }},
+    {"received", [](protection_counts *p, const std::string &v) { p->received = number(v); }},
+    {"delivered", [](protection_counts *p, const std::string &v) { p->delivered = number(v); }},
+    {"returned", [](protection_counts *p, const std::string &v) { p->returned = number(v); }},
+};
+
+static const state_row<protected_group> protected_group_rows[] = {
+    {"covered", [](protected_group *g, const std::string &v) { g->covered = v == "true"; }},
+    {"reason", [](protected_group *g, const std::string &v) { g->reason = clean_text(v, 63); }},
+    {"slots", [](protected_group *g, const std::string &v) { g->slots = number_of<uint32_t>(v, 0); }},
+};
+
 template <typename Subject, size_t COUNT>
 static void take_row(const state_row<Subject> (&rows)[COUNT], const std::string &node,
                      const std::string &value, Subject *subject) {
@@ -68,6 +81,7 @@ const std::vector<sorted_way> &sorted_ways() {
         {"forwarded", "forwarded"},
         {"dropped", "dropped"},
         {"own", "own"},
+        {"passed", "passed on"},
         {"overload", "overload"},
     };
     return ways;
@@ -142,6 +156,20 @@ static void take_intercept(const std::vector<std::string> &parts, const std::str
     take_sorted(parts[1], value, &intercept->sorted);
 }
 
+static void take_protection(const std::vector<std::string> &parts, const std::string &value,
+                            traffic_state *out) {
+    protection_state *const all = &out->protection;
+    if (parts.size() == 1 && parts[0] == "time")
+        all->time = number_of<uint32_t>(value, 0);
+    else if (parts.size() == 1)
+        take_row(protection_rows, parts[0], value, &all->sum);
+    else if (parts.size() == 3 && parts[0] == "group") {
+        if (protected_group *group = entry_of(&all->groups, &protected_group::group, parts[1]))
+            take_row(protected_group_rows, parts[2], value, group);
+    } else if (parts.size() == 3 && parts[0] == "member" && all->members.size() < ENTRIES_MAX)
+        take_row(protection_rows, parts[2], value, &all->members[clean_text(parts[1], 15)]);
+}
+
 static void take_accepted(const std::vector<std::string> &parts, const std::string &value,
                           traffic_state *out) {
     if (out->accepted.size() >= ENTRIES_MAX)
@@ -178,9 +206,13 @@ bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
         bool of_tunneld;
         void (*take)(const std::vector<std::string> &parts, const std::string &value, traffic_state *out);
     } walks[] = {
-        {NODE_PLANE_STATE, true, take_plane},         {NODE_TUNNEL_STATE, true, take_tunnel},
-        {NODE_INTERCEPT_STATE, true, take_intercept}, {NODE_ACCEPT_CONFIG, false, take_accepted},
-        {NODE_LEFT_GROUPS, false, take_left},         {NODE_DRAINS, false, take_drained},
+        {NODE_PLANE_STATE, true, take_plane},
+        {NODE_TUNNEL_STATE, true, take_tunnel},
+        {NODE_INTERCEPT_STATE, true, take_intercept},
+        {NODE_ACCEPT_CONFIG, false, take_accepted},
+        {NODE_PROTECTION_STATE, true, take_protection},
+        {NODE_LEFT_GROUPS, false, take_left},
+        {NODE_DRAINS, false, take_drained},
     };
     *out = {};
     out->tunneld = tunneld_condition::running;
@@ -231,6 +263,11 @@ std::string sorted_text(const sorted_counts &counts) {
             out += (out.empty() ? "" : "  ") + std::string(way.shown) + " " + count_text(packets);
     }
     return out;
+}
+
+std::string protection_text(const protection_counts &counts) {
+    return "passed on " + count_text(counts.passed) + "  received " + count_text(counts.received) +
+           "  delivered " + count_text(counts.delivered) + "  returned " + count_text(counts.returned);
 }
 
 std::string proxy_text(const traffic_intercept &intercept) {
@@ -341,6 +378,12 @@ static void standing_by(const traffic_state &state, const reason_list &list) {
                      each.group);
 }
 
+static void unprotected(const traffic_state &state, const reason_list &list) {
+    for (const protected_group &each : state.protection.groups)
+        if (!each.covered && state.protection.time != 0)
+            list.add("group " + std::to_string(each.group) + " is unprotected: " + each.reason, each.group);
+}
+
 std::vector<traffic_reason> traffic_reasons(const traffic_state &state) {
     static const struct {
         const char *word;
@@ -354,6 +397,7 @@ std::vector<traffic_reason> traffic_reasons(const traffic_state &state) {
         {"overload", overloads},
         {"slow_start", slow_starts},
         {"standing_by", standing_by},
+        {"unprotected", unprotected},
         {"own_traffic", own_traffic},
         {"refused_source", refused_sources},
         {"fragments", fragments},

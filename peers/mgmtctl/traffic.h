@@ -45,6 +45,22 @@ struct traffic_drain {
     int64_t flows = -1; // that are left; -1 unknown
     int64_t until = 0;  // seconds since 1970
 };
+// Flows that belong to other appliances, or whose packets others have passed on.
+struct protection_counts {
+    uint64_t passed = 0, received = 0, delivered = 0, returned = 0; // packets
+};
+struct protected_group {
+    int group = 0;
+    bool covered = false;
+    std::string reason; // why it isn't
+    uint32_t slots = 0; // whose packets are passed on
+};
+struct protection_state {
+    uint32_t time = 0; // seconds, 0: switched off
+    protection_counts sum;
+    std::vector<protected_group> groups;              // by group
+    std::map<std::string, protection_counts> members; // by address
+};
 enum class tunneld_condition { running, silent, absent };
 struct traffic_state {
     tunneld_condition tunneld = tunneld_condition::absent; // unless it is running, it has said nothing
@@ -56,6 +72,7 @@ struct traffic_state {
     std::map<std::string, uint64_t> refused_sources; // packets by address, REFUSED_SOURCES_MAX at most
     std::vector<traffic_tunnel> tunnels;             // by id
     std::vector<traffic_intercept> intercepts;       // by group
+    protection_state protection;
     // From mgmtd, also without a tunneld:
     std::map<std::string, std::string>
         accepted;                      // sources beside the routers; only beside this one, "" for all
@@ -76,8 +93,9 @@ struct sorted_way {
 const std::vector<sorted_way> &sorted_ways();
 // "in 120  to proxy 100  ...": packets, leaving out what is zero except for the first three.
 std::string sorted_text(const sorted_counts &counts);
-std::string proxy_text(const traffic_intercept &intercept); // "proxy up 0:10:40"
-const char *tunneld_word(tunneld_condition condition);      // "running", "silent", "absent"
+std::string proxy_text(const traffic_intercept &intercept);   // "proxy up 0:10:40"
+std::string protection_text(const protection_counts &counts); // "passed on 12  received 3  ..."
+const char *tunneld_word(tunneld_condition condition);        // "running", "silent", "absent"
 
 std::string drain_text(const traffic_drain &drain, int64_t now); // "draining, 12 flows left, ..."
 

@@ -239,6 +239,18 @@ static std::string count_of_bytes(const traffic_count &count) {
     return count_text(count.packets) + " (" + count_text(count.bytes) + " bytes)";
 }
 
+static void put_protection(const protection_state &state) {
+    put("protection of flows " +
+        (state.time ? "for " + std::to_string(state.time) + " s" : std::string("switched off")) + "\n  " +
+        protection_text(state.sum) + "\n");
+    for (const protected_group &each : state.groups)
+        put("  group " + std::to_string(each.group) +
+            (each.covered ? "  " + std::to_string(each.slots) + " slots passed on\n"
+                          : "  not covered: " + each.reason + "\n"));
+    for (const auto &[address, counts] : state.members)
+        put("  appliance " + address + "  " + protection_text(counts) + "\n");
+}
+
 static void put_tunnels(const traffic_state &traffic) {
     put("data plane " + traffic.plane + "\n" +
         (traffic.plane_reason.empty() ? "" : "  not used: " + traffic.plane_reason + "\n") +
@@ -249,6 +261,8 @@ static void put_tunnels(const traffic_state &traffic) {
             std::to_string(tunnel.index) + "\n  in " + count_of_bytes(tunnel.in) + "  out " +
             count_of_bytes(tunnel.out) + "  fragments " + count_text(tunnel.fragments) +
             "\n  sorted: " + sorted_text(tunnel.sorted) + "\n" + refused_text(tunnel.refused));
+    if (traffic.protection.time != 0)
+        put_protection(traffic.protection);
     for (const auto &[address, packets] : traffic.refused_sources)
         put("refused " + count_text(packets) + " from " + address + "\n");
     if (traffic.refused_sources.size() >= REFUSED_SOURCES_MAX)
@@ -284,4 +298,28 @@ int ctl_tunnel(const ctl_options &options, const std::vector<std::string> &words
     if (words.size() == 1 && words[0] == "show")
         return tell_tunnels(options, link_to_mgmtd(options));
     return tell_result(options, tunnel_command(link_to_mgmtd(options), words));
+}
+
+// --- Protection of flows
+
+static int tell_protection(const ctl_options &options, const ctl_link &link) {
+    asking mgmtd = {link};
+    traffic_state traffic;
+    if (!mgmtd.ask_traffic(&traffic))
+        return tell_failure(options, mgmtd.failure);
+    const bool running = traffic.tunneld == tunneld_condition::running;
+    if (options.json)
+        put(json_line({{"tunneld", tunneld_word(traffic.tunneld)},
+                       {"protection", running ? protection_json(traffic.protection) : ctl_json(nullptr)}}));
+    else if (running)
+        put_protection(traffic.protection);
+    else
+        put_absence(traffic.tunneld);
+    return running ? CTL_OK : CTL_UNREACHABLE;
+}
+
+int ctl_protection(const ctl_options &options, const std::vector<std::string> &words) {
+    if (words.empty())
+        return tell_protection(options, link_to_mgmtd(options));
+    return tell_result(options, protection_command(link_to_mgmtd(options), words));
 }

@@ -59,6 +59,30 @@ ctl_json drains_json(const std::vector<traffic_drain> &drains) {
     return out;
 }
 
+static ctl_json protection_counts_json(const protection_counts &counts) {
+    return {{"passed", counts.passed},
+            {"received", counts.received},
+            {"delivered", counts.delivered},
+            {"returned", counts.returned}};
+}
+
+ctl_json protection_json(const protection_state &state) {
+    ctl_json out = protection_counts_json(state.sum);
+    out["time"] = state.time;
+    out["groups"] = ctl_json::array();
+    for (const protected_group &each : state.groups)
+        out["groups"].push_back({{"group", each.group},
+                                 {"covered", each.covered},
+                                 {"reason", text_or_null(each.reason)},
+                                 {"slots", each.slots}});
+    out["members"] = ctl_json::array();
+    for (const auto &[address, counts] : state.members) {
+        out["members"].push_back(protection_counts_json(counts));
+        out["members"].back()["address"] = address;
+    }
+    return out;
+}
+
 ctl_json traffic_json(const traffic_state &state) {
     const bool running = state.tunneld == tunneld_condition::running;
     ctl_json out = {{"tunneld", tunneld_word(state.tunneld)},
@@ -71,6 +95,7 @@ ctl_json traffic_json(const traffic_state &state) {
                     {"refused_sources", state.refused_sources},
                     {"tunnels", ctl_json::array()},
                     {"intercepts", ctl_json::array()},
+                    {"protection", running ? protection_json(state.protection) : ctl_json(nullptr)},
                     {"left", ctl_json::array()},
                     {"drains", drains_json(state.drains)},
                     {"reasons", ctl_json::array()}};

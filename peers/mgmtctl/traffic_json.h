@@ -9,3 +9,4 @@ ctl_json traffic_json(const traffic_state &state);
 ctl_json drains_json(const std::vector<traffic_drain> &drains);
 // What tunneld answers about one intercept, null: nothing.
 ctl_json intercept_state_json(const traffic_intercept *intercept);
+ctl_json protection_json(const protection_state &state);

@@ -2,6 +2,7 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -88,6 +89,33 @@ std::map<uint8_t, group_protection> find_protections(const owners_table &owners,
             if (member != view->second.local)
                 made.members.push_back(member);
         made.targets = slot_targets(group, view->second.local, now_s(), protection_s);
+    }
+    return out;
+}
+
+std::map<uint8_t, group_cover> find_covers(const appliance_view &view, bool user_space, bool enabled,
+                                           bool has_redirect_headers) {
+    std::map<uint8_t, group_cover> out;
+    for (const auto &[number, group] : view.groups) {
+        const auto protection = view.protections.find(number);
+        const bool by_l2 = std::any_of(group.routers.begin(), group.routers.end(),
+                                       [](const auto &router) { return router.forward == travel::l2; });
+        if (!view.intercepts.contains(number) && protection == view.protections.end())
+            continue;
+        group_cover &cover = out[number];
+        if (!enabled)
+            cover.reason = "switched off";
+        else if (protection == view.protections.end() || protection->second.targets.empty())
+            cover.reason = "the owners of its table are not known";
+        else if (!protection->second.by_mask && by_l2)
+            cover.reason = "hash assignment over L2: packets carry no bucket";
+        else if (!protection->second.by_mask && !user_space)
+            cover.reason = "hash assignment: the kernel plane does not see the bucket";
+        else if (!protection->second.by_mask && !has_redirect_headers)
+            cover.reason = "hash assignment: packets carry no redirect header";
+        if (cover.reason.empty())
+            for (const uint32_t target : protection->second.targets)
+                cover.slots += target != 0;
     }
     return out;
 }

@@ -27,3 +27,13 @@ void keep_owners_of(owners_table *owners, const std::map<uint8_t, group_view> &g
 std::map<uint8_t, group_protection> find_protections(const owners_table &owners,
                                                      const std::map<uint8_t, group_view> &groups,
                                                      uint32_t protection_s);
+
+// Of a group that has an intercept, or whose table is known: why its flows are not protected, "" where they
+// are, and how many slots have packets passed on.
+struct group_cover {
+    std::string reason;
+    size_t slots = 0;
+};
+// `has_redirect_headers`: what routers have sent in GRE so far has come with one. Nothing for no group.
+std::map<uint8_t, group_cover> find_covers(const appliance_view &view, bool user_space, bool enabled,
+                                           bool has_redirect_headers);

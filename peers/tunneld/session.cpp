@@ -222,8 +222,9 @@ state_tree tree_of(const std::vector<state_node> &nodes) {
 
 // Such a node is there so that it can be listed; its value is its own last part.
 bool is_one_of_many(const node_name &name) {
-    static const node_name patterns[] = {parsed_name(NODE_TUNNEL_STATE "/*"),
-                                         parsed_name(NODE_INTERCEPT_STATE "/*")};
+    static const node_name patterns[] = {
+        parsed_name(NODE_TUNNEL_STATE "/*"), parsed_name(NODE_INTERCEPT_STATE "/*"),
+        parsed_name(NODE_PROTECTION_STATE "/group/*"), parsed_name(NODE_PROTECTION_STATE "/member/*")};
     return std::any_of(std::begin(patterns), std::end(patterns),
                        [&](const node_name &pattern) { return matches(pattern, name); });
 }

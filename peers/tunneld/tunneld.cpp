@@ -562,6 +562,19 @@ bool is_active_group(const tunneld &daemon, uint8_t group) {
     return role != daemon.roles.end() && role->second;
 }
 
+// Until a packet has come, what routers send is taken to have a redirect header, as by far the most have.
+std::map<uint8_t, group_cover> protection_cover(const tunneld &daemon, const plane_counters &plane) {
+    uint64_t packets = 0, headers = 0;
+    for (const wanted_link &link : daemon.links)
+        if (const auto found = plane.links.find(link.name);
+            found != plane.links.end() && link.wish.kind == link_kind::tunnel) {
+            packets += found->second.packets_in;
+            headers += found->second.redirect_headers;
+        }
+    return find_covers(view_appliance(daemon), daemon.plane == &user_plane,
+                       daemon.configured.protection_s != 0, packets == 0 || headers != 0);
+}
+
 int run_tunneld(const tunneld_options &options) {
     int lock = -1;
     lc_init();

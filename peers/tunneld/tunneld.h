@@ -13,6 +13,7 @@
 #include "peers/tunneld/course.h"
 #include "peers/tunneld/health.h"
 #include "peers/tunneld/plane.h"
+#include "peers/tunneld/protection.h"
 #include "peers/tunneld/session.h"
 #include "peers/tunneld/slot_owners.h"
 #include "peers/tunneld/sorting_rules.h"
@@ -98,6 +99,8 @@ void follow_groups(tunneld *daemon);
 // role of a policy group is against it.
 bool is_active_group(const tunneld &daemon, uint8_t group);
 bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules);
+// Of each group whether its flows are protected.
+std::map<uint8_t, group_cover> protection_cover(const tunneld &daemon, const plane_counters &plane);
 // The program, until a signal ends it. The exit code.
 int run_tunneld(const tunneld_options &options);
 // The state nodes, in the order of a walk.

@@ -5,6 +5,7 @@
 #include "mgmt/node_paths.h"
 #include "peers/tunneld/flow_count.h"
 #include "peers/tunneld/link_names.h"
+#include "peers/tunneld/protection.h"
 #include "peers/tunneld/tunneld.h"
 #include "runtime/ttime.h"
 
@@ -115,6 +116,65 @@ void add_intercepts(const tunneld &daemon, const sorting_counters &sorting, std:
     }
 }
 
+// What has been exchanged with one other appliance.
+struct member_counts {
+    std::string interface;
+    uint64_t passed = 0, received = 0, delivered = 0, returned = 0;
+};
+
+std::map<uint32_t, member_counts> count_members(const tunneld &daemon, const plane_counters &plane,
+                                                const sorting_counters &sorting) {
+    std::map<uint32_t, member_counts> members;
+    for (const wanted_link &link : daemon.links) {
+        if (link.wish.kind != link_kind::member)
+            continue;
+        member_counts &counts = members[link.wish.remote];
+        counts.interface = link.name;
+        if (const auto found = plane.links.find(link.name); found != plane.links.end())
+            counts.passed += found->second.packets_out;
+        if (const auto found = sorting.interfaces.find(link.name); found != sorting.interfaces.end()) {
+            counts.received += found->second[SORTED_IN].packets;
+            counts.delivered += found->second[SORTED_TO_PROXY].packets;
+            counts.returned += found->second[SORTED_RETURNED].packets;
+        }
+    }
+    return members;
+}
+
+void add_protection(const tunneld &daemon, const plane_counters &plane, const sorting_counters &sorting,
+                    std::vector<state_node> *out) {
+    const auto members = count_members(daemon, plane, sorting);
+    member_counts sum;
+    for (const auto &[address, counts] : members) {
+        sum.passed += counts.passed;
+        sum.received += counts.received;
+        sum.delivered += counts.delivered;
+        sum.returned += counts.returned;
+    }
+    const auto add_counts = [](node_writer *writer, const member_counts &counts) {
+        writer->count("passed", counts.passed);
+        writer->count("received", counts.received);
+        writer->count("delivered", counts.delivered);
+        writer->count("returned", counts.returned);
+    };
+    node_writer writer = {out, NODE_PROTECTION_STATE};
+    writer.add("time", bn_type_uint32, std::to_string(daemon.configured.protection_s));
+    add_counts(&writer, sum);
+    for (const auto &[number, cover] : protection_cover(daemon, plane)) {
+        writer.above = std::string(NODE_PROTECTION_STATE) + "/group/" + std::to_string(number);
+        out->push_back({writer.above, bn_type_uint8, std::to_string(number)});
+        writer.add("covered", bn_type_bool, cover.reason.empty() ? "true" : "false");
+        writer.add("reason", bn_type_str, cover.reason);
+        writer.add("slots", bn_type_uint32, std::to_string(cover.slots));
+    }
+    for (const auto &[address, counts] : members) {
+        writer.above = std::string(NODE_PROTECTION_STATE) + "/member/" + address_text(address);
+        out->push_back({writer.above, bn_type_ipv4addr, address_text(address)});
+        writer.add("interface", bn_type_str, counts.interface);
+        add_counts(&writer, counts);
+    }
+}
+
 } // namespace
 
 std::vector<state_node> tunneld_state(const tunneld &daemon) {
@@ -144,5 +204,6 @@ std::vector<state_node> tunneld_state(const tunneld &daemon) {
 
     add_tunnels(daemon, plane, sorting, &out);
     add_intercepts(daemon, sorting, &out);
+    add_protection(daemon, plane, sorting, &out);
     return out;
 }
