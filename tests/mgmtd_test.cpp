@@ -992,6 +992,33 @@ TEST_F(Mgmtd, AStateThatNobodyGives) {
 
 // --- Events
 
+// A process has several sessions; another process id is a restart, and its predecessor's late end is none.
+TEST_F(Mgmtd, ProcessesAreKnownByTheirSessions) {
+    const auto process = [&] {
+        query(3, NODE_PROCESSES, bn_query_iterate, bn_qf_subtree);
+        strings out = found();
+        std::erase_if(out, [](const std::string &node) { return node.find("/since=") != std::string::npos; });
+        return out;
+    };
+    const auto wccpd = [](const char *state, const char *pid, const char *restarts) {
+        return strings{NODE_PROCESSES "/wccpd=" + std::string(state),
+                       NODE_PROCESSES "/wccpd/pid=" + std::string(pid),
+                       NODE_PROCESSES "/wccpd/restarts=" + std::string(restarts)};
+    };
+    EXPECT_EQ(process(), wccpd("running", "7", "0"));
+    server_peer_closed(&daemon, 2);
+    EXPECT_EQ(process(), wccpd("running", "7", "0"));
+    server_peer_opened(&daemon, 6, "wccpd-9");
+    EXPECT_EQ(process(), wccpd("running", "9", "1"));
+    server_peer_closed(&daemon, 1);
+    EXPECT_EQ(process(), wccpd("running", "9", "1"));
+    server_peer_closed(&daemon, 6);
+    EXPECT_EQ(process(), wccpd("gone", "9", "1"));
+    server_peer_opened(&daemon, 7, "wccpdx-1");
+    server_peer_opened(&daemon, 8, "tunneld-x");
+    EXPECT_EQ(process(), wccpd("gone", "9", "1"));
+}
+
 TEST_F(Mgmtd, ReportsStandUntilTheirSessionEndsAndAreBounded) {
     action(3, "/mgmtd/events/actions/interest/add",
            {{"event_name", {bn_type_name, "/qv/alarms/events/raise_alarm"}}});
@@ -1013,11 +1040,11 @@ TEST_F(Mgmtd, ReportsStandUntilTheirSessionEndsAndAreBounded) {
                                                                     {"code", {bn_type_str, "many"}}})));
     clear();
     query(3, "/qv/alarms/state", bn_query_iterate, bn_qf_subtree);
-    EXPECT_EQ(found().size(), 7u);
+    EXPECT_EQ(found().size(), 11u) << "four of them about the process";
     EXPECT_TRUE(has(found(), "/qv/alarms/state/role/51=BACKUP") &&
                 has(found(), "/qv/alarms/state/role/51/code=0"));
     server_peer_closed(&daemon, 2);
-    query(3, "/qv/alarms/state", bn_query_iterate, bn_qf_subtree);
+    query(3, NODE_ALARMS_RAISED, bn_query_iterate, bn_qf_subtree);
     EXPECT_EQ(found(), strings{});
     for (size_t i = 0; i < ALARMS_MAX + 9; i++)
         raise(3, std::to_string(i), std::string(5000, 'x'));
