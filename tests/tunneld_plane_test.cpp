@@ -10,6 +10,7 @@
 #include <poll.h>
 #include <sched.h>
 #include <signal.h>
+#include <sys/mount.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/uio.h>
@@ -26,8 +27,10 @@
 
 #include "peers/tunneld/coalesce.h"
 #include "peers/tunneld/gre.h"
+#include "peers/tunneld/kernel_state.h"
 #include "peers/tunneld/passing.h"
 #include "peers/tunneld/plane.h"
+#include "peers/tunneld/wanted_state.h"
 
 namespace {
 
@@ -452,6 +455,39 @@ int echo_once() {
     return 0;
 }
 
+// --- two appliances: this one and, beside the router, STRANGER. Each is sure that the other has all flows.
+
+bool be_sure(uint32_t self, uint32_t other, bool by_mask, std::string *out_error) {
+    appliance_view view;
+    view.tunnels[1] = {self, ROUTER};
+    view.groups[51] = {"", self, 0, false, {{ROUTER, ROUTER, travel::gre, travel::gre}}};
+    view.intercepts[51].to = 3128;
+    view.protections[51] = {by_mask, {}, {other}, std::vector<uint32_t>(by_mask ? 1 : 256, other)};
+    std::map<std::string, uint32_t> indices;
+    return user_plane.open(out_error) &&
+           reconcile_kernel_state(user_plane, make_wanted_state(view, {}, true), &indices, out_error);
+}
+
+int become_appliance(bool by_mask, std::string *out_error) {
+    return unshare(CLONE_NEWNS) != 0 || mount("", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+           mount("", "/run", "tmpfs", 0, nullptr) != 0 || system("ip link set lo up") != 0 ||
+           !be_sure(STRANGER, APPLIANCE, by_mask, out_error);
+}
+
+// Redirects a packet of a flow that nobody has. It has to come back once, from the other appliance.
+int redirect_once() {
+    const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
+    send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_TCP, 1, 9), {0x80, 51, 0, 9}));
+    int count = 0;
+    bytes got(2048);
+    for (pollfd waits = {back, POLLIN, 0}; poll(&waits, 1, count ? 300 : 3000) == 1; count++)
+        if (recv(back, got.data(), got.size(), 0) < 60 || to_host(ip(&got)->source) != STRANGER ||
+            at<ip4_wire_header>(&got, 24)->ttl != 58)
+            count += 10;
+    close(back);
+    return count == 1 ? 0 : 10 + count;
+}
+
 int child_main(int commands, int answers) {
     prctl(PR_SET_PDEATHSIG, SIGKILL);
     if (unshare(CLONE_NEWNET) != 0)
@@ -470,6 +506,10 @@ int child_main(int commands, int answers) {
                      system("ip addr add 192.168.9.2/24 dev wccp0 && ip link set wccp0 up") != 0;
         else if (command == 'e')
             result = echo_once();
+        else if (command == 'm' || command == 'b')
+            result = become_appliance(command == 'm', &error);
+        else if (command == 'r')
+            result = redirect_once();
         if (result)
             fprintf(stderr, "router: '%c' gave %d %s\n", command, result, error.c_str());
         const char answer = result == 0 ? 'y' : 'n';
@@ -617,6 +657,25 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     ASSERT_TRUE(user_plane.make_link("wccp0", wish, &again, &error)) << error;
     EXPECT_EQ(again, if_nametoindex("wccp0"));
     shell("ip link set wccp0 up");
+}
+
+TEST_F(live_plane, two_that_take_each_other_for_the_owner_exchange_a_packet_once) {
+    std::string error;
+    for (const char kind : {'m', 'b'}) {
+        SCOPED_TRACE(kind);
+        order(kind);
+        ASSERT_TRUE(answered());
+        ASSERT_TRUE(be_sure(APPLIANCE, STRANGER, kind == 'm', &error)) << error;
+        order('r');
+        EXPECT_TRUE(answered());
+        plane_counters counters;
+        user_plane.read_counters(&counters);
+        EXPECT_EQ(counters.links["wccp1"].packets_out, 1); // the member's
+        EXPECT_EQ(counters.links["wccp1"].packets_in, 0);
+        EXPECT_EQ(counters.links["wccp0"].packets_out, 0);
+        EXPECT_TRUE(remove_kernel_state(user_plane, &error)) << error;
+        user_plane.close();
+    }
 }
 
 } // namespace
