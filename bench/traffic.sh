@@ -30,7 +30,7 @@ export LAB_PLANE=user
 source "$top/lab/topology.sh"
 lab_enter "$0" "$@"
 [ $# -gt 0 ] && shift
-parts=("$@"); [ $# -gt 0 ] || parts=(tcp packets upload orders start idle)
+parts=("$@"); [ $# -gt 0 ] || parts=(tcp packets upload orders start idle protection)
 load=$WCCP_BIN/traffic_load
 die() { echo "$*" >&2; tail -n 12 "$LAB"/*.log "$LAB"/*.out >&2; exit 1; }
 
@@ -229,6 +229,26 @@ part_upload() {
     figure 'its segment size' "$(jq .mss <<<"$out")" '>= 1448'
 }
 
+# The flow's bucket is another appliance's: its packets are given to the kernel as what is to be passed on, and find
+# their socket.
+protected() { # off|on
+    local -A times=([off]=0 [on]=300)
+    lab_in a1 "$WCCP_BIN/mgmtctl" protection time "${times[$1]}" >/dev/null || die "not configured"
+    sleep 2
+    tcp redirected
+}
+part_protection() {
+    lab_appliance a0 10.0.0.90
+    lab_gateway a0 10.0.0.1
+    lab_appliance_start a0 "$(lab_group 51 10.0.0.1)"
+    lab_wait 60 '.[] | select(.name == "/qv/tunneld/protection/state/group/51/slots") | .value == "128"' \
+        lab_manage a1 walk /qv/tunneld/protection/state || die "no other appliance"
+    protected on
+    rounds protected off on
+    figure 'throughput, flow protection on to off' "$(of_rounds protected '$4 / $1')" '>= 0.97'
+    figure 'processor time for a megabyte, flow protection on to off' "$(of_rounds protected '$5 / $2')" '<= 1.05'
+    lab_end a0 || die "the other appliance does not end in order"
+}
 part_orders() {
     local times=$LAB/orders i
     lab_alone "$WCCP_BIN/tunneld_timed" orders "$WCCP_BIN/tunneld" 50 0 >"$times" || die 'orders failed'
@@ -265,7 +285,7 @@ part_idle() {
 }
 
 for part in "${parts[@]}"; do
-    case $part in tcp | packets | upload | idle) [ -n "${tunneld-}" ] || set_up ;; esac
+    case $part in tcp | packets | upload | idle | protection) [ -n "${tunneld-}" ] || set_up ;; esac
     "part_$part"
 done
 if [ -n "${tunneld-}" ]; then
