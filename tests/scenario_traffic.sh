@@ -187,6 +187,7 @@ case_leaving() {
     [ "$(lab_in a1 ip -o link show group 2048 | wc -l)" = 1 ] || die "not the same link"
 
     lab_stop a1 wccpd || die "wccpd: $?"
+    lab_sleep 2
     lab_in a1 ip link show wccp0 >/dev/null || die "nothing lingers"
     fetches "$direct" --count 4
     lab_stop a1 tunneld || die "tunneld: $?"
