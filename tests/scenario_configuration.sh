@@ -267,7 +267,7 @@ case_fleet() {
     { declare -p LAB_INIT; echo 'exec nsenter -t "${LAB_INIT[$1]}" --net --mount --root --ipc --pid --wdns=/ "$WCCP_BIN/${@:2}"'; } >"$LAB/at"
     fleet() { # STATUS SAID WORDS...
         local status=$1 said=$2 got; shift 2
-        got=$(FLEET_RUN="bash $LAB/at" FLEET_WAIT=1 "$LAB_TOP/packaging/examples/fleet-apply" "$@" 2>&1 | grep -v ^mgmtctl; exit "${PIPESTATUS[0]}")
+        got=$(FLEET_RUN="bash $LAB/at" FLEET_WAIT=1 FLEET_HEALTH=${FLEET_HEALTH-mgmtctl get /qv/tunneld/system/config/mode} "$LAB_TOP/packaging/examples/fleet-apply" "$@" 2>&1 | grep -v ^mgmtctl; exit "${PIPESTATUS[0]}")
         [ $? = "$status" ] && [ "$got" = "$said" ] || die "fleet-apply $*: $got"
     }
     lab_group 51 10.0.0.1 10.0.0.102 weight=7 >"$file"
