@@ -196,7 +196,7 @@ int wccp_get_reason_list(int id, wccp_reason_list *list) {
     const wccp_reason *const table = wccp_reasons_of(group, &places);
     list->count = 0;
     for (uint32_t i = 0; i < places; i++)
-        if (table[i].code != WCCP_REASON_NONE)
+        if (wccp_reason_holds(&table[i]))
             list->places[list->count++] = static_cast<uint8_t>(i + 1);
     return 0;
 }
@@ -211,7 +211,7 @@ int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info) {
     uint32_t places;
     const wccp_reason *const table = wccp_reasons_of(group, &places);
     *info = {};
-    if (place < 1 || place > places || table[place - 1].code == WCCP_REASON_NONE)
+    if (place < 1 || place > places || !wccp_reason_holds(&table[place - 1]))
         return 0;
     info->reason = table[place - 1];
     info->first_before = wccp_g.seconds - info->reason.first;

@@ -11,8 +11,11 @@ namespace {
 
 struct code_row {
     const char *word;
-    bool of_packets; // ends with the next I-See-You of the sender that is taken
+    bool of_packets;      // ends with the next I-See-You of the sender that is taken
+    bool lasting = false; // and not by itself when it is not repeated
 };
+constexpr uint32_t REPEATED_WITHIN = 60; // seconds; a router that is refused sends again after ten
+
 // By code.
 constexpr code_row code_rows[] = {
     {"", false},
@@ -35,7 +38,7 @@ constexpr code_row code_rows[] = {
     {"routers-exhausted", true},
     {"query-refused", true},
     {"not-in-view", true},
-    {"router-silent", true},
+    {"router-silent", true, true},
     {"election-blocked", false},
     {"method-differs", true},
     {"mask-differs", true},
@@ -56,7 +59,7 @@ constexpr code_row code_rows[] = {
     {"tunnel-refused", true},
     {"tunnel-timeout", true},
     {"tunnel-ids-exhausted", true},
-    {"tunneld-silent", true},
+    {"tunneld-silent", true, true},
     {"mailbox-missing", true},
 };
 static_assert(sizeof code_rows / sizeof *code_rows == WCCP_REASON_CODES);
@@ -100,6 +103,12 @@ wccp_reason *find_reason(wccp_service_group *group, wccp_reason_code code, be32 
 
 const char *wccp_reason_word(uint32_t code) {
     return code < WCCP_REASON_CODES ? code_rows[code].word : "";
+}
+
+bool wccp_reason_holds(const wccp_reason *reason) {
+    const code_row *row = &code_rows[reason->code];
+    return reason->code != WCCP_REASON_NONE &&
+           (!row->of_packets || row->lasting || wccp_g.seconds - reason->last <= REPEATED_WITHIN);
 }
 
 wccp_reason_text wccp_reason_value(const char *format, ...) {

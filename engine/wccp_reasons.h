@@ -5,7 +5,7 @@
 // group has a table, and the packets of no group share one. Tables have a fixed size and take no memory of
 // their own: a full one gives up its oldest reason, that of a stranger before that of a known router, for
 // anybody can send packets. Reasons that a router's packets give end when an I-See-You of that router is
-// taken; the others end with the step that succeeds.
+// taken, or when no packet has repeated them for a minute; the others end with the step that succeeds.
 //
 // Engine lock held throughout.
 #pragma once
@@ -84,6 +84,8 @@ struct wccp_reason {
 
 // The stable word of a code, such as "password-mismatch"; "" for none.
 const char *wccp_reason_word(uint32_t code);
+// False for a free place and for a reason that nothing has repeated.
+bool wccp_reason_holds(const wccp_reason *reason);
 // A value; what is too long is cut.
 __attribute__((format(printf, 1, 2))) wccp_reason_text wccp_reason_value(const char *format, ...);
 // A null group: of a packet that belongs to none.

@@ -273,6 +273,13 @@ TEST_F(DaemonMonitor, ReasonsAndCounters) {
     for (const std::string gone : {"0", "40", "41", "4294967297", "x"})
         EXPECT_EQ(of_51("reason/" + gone + "/code"), NOTHING);
     EXPECT_EQ(children(STATE + "/7/reason"), "");
+    note(group, WCCP_REASON_ROUTER_SILENT, 202);
+    note(group, WCCP_REASON_SEND_FAILED, 202);
+    wccp_g.seconds += 61; // nothing repeats it, and what is not repeated stays
+    EXPECT_EQ(children(SYSTEM + "reason"), "");
+    EXPECT_EQ(get(SYSTEM + "reason/1/code"), NOTHING);
+    EXPECT_EQ(of_51("reason/1/code"), one(bn_type_str, "router-silent"));
+    EXPECT_EQ(children(STATE + "/51/reason").size(), 4u);
 
     group->start_time = wccp_g.seconds - 9;
     group->rx_icu_failures = 4294967295;

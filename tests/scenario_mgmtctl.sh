@@ -149,7 +149,7 @@ ctl bypass add 10.0.0.0/8 >/dev/null && ctl intercept add 51 all to 3128 >/dev/n
 [ "$(completed bypass delete 10.0.0.0/)" = 10.0.0.0/8 ] && [ "$(completed intercept set '')" = 51 ] &&
     [ "$(completed intercept set 51 ch)" = check ] && [ "$(completed intercept set 51 rest d)" = drop ] ||
     fail "the shell completes words of redirected traffic otherwise"
-lab_wait 20 '.intercepts[0] | .group == 51 and .active' ctl --json intercept show 051 || fail "the intercept is not active"
+expect 0 'jq:.intercepts[0] | .group == 51 and .active == false' --json intercept show 051 # no router has assigned yet
 ctl bypass delete 10.0.0.0/8 >/dev/null; ctl intercept delete 51 >/dev/null
 [ "$(completed al)" = alarms ] && [ "$(completed get "${G%1}")" = $G ] && [ "$(completed group set '')" = 51 ] &&
     [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&
@@ -232,19 +232,26 @@ explains() { # GROUP CODE WORDS : within some seconds the first reason of the gr
         ctl --json explain "$1" || fail "explain $1 does not say $2: $3"
 }
 expect 0 '*nothing needs attention*' explain 51
-for broken in 'set 51 password falsch' 'add 60 interface eth9 router 10.0.0.1' 'add 61 interface eth0 router 10.0.0.77' 'add 62'; do
+for broken in 'add 60 interface eth9 router 10.0.0.1' 'add 61 interface eth0 router 10.0.0.77' 'add 62'; do
     # shellcheck disable=SC2086
     ctl group $broken >/dev/null || fail "mgmtd refuses group $broken"
 done
-explains 51 password-mismatch '10.0.0.1 signs its messages with another password'
 explains 60 interface-missing 'no interface eth9'
 explains 61 no-answer '10.0.0.77 does not answer'
 explains 62 no-interface 'has no interface'
-expect 1 '*group 51 *password-mismatch: *[0-9] ago*next: *' explain
-expect 0 '*no interface eth9*> create it, or mgmtctl group set 60 interface NAME*' show
-ctl set $G/password '' >/dev/null
-explains 51 security-unwanted 'the group has no password'
-ctl set $G/password geheim >/dev/null
+while read -r broken code words; do
+    lab_ctl r1 fault "$broken" always >/dev/null
+    explains 51 "$code" "$words"
+done <<'FAULTS'
+bad-digest password-mismatch 10.0.0.1 signs its messages with another password
+other-security security-missing 10.0.0.1 signs no message
+bad-version message-version 10.0.0.1 speaks version 0x100
+routers-33 message-malformed 33 routers
+other-service service-mismatch here it is priority 200
+FAULTS
+expect 1 '*group 51 *service-mismatch: *[0-9] ago*next: *' explain
+expect 0 '*51  ACTIVE, designated !*10.0.0.1 has the service with priority 201*' show
+lab_ctl r1 fault none >/dev/null
 for broken in 60 61 62; do ctl group delete $broken >/dev/null; done
 lab_wait 20 '.attention == false' ctl --json explain 51 || fail "a reason stays"
 expect 2 '' explain 300
