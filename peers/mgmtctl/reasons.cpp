@@ -216,6 +216,8 @@ static bool has_reason(const snapshot_group &group, std::initializer_list<const 
 
 static void add_noted(const std::vector<snapshot_reason> &noted, int group, reason_list *list) {
     for (const snapshot_reason &each : noted) {
+        if (each.code == "interface-missing" && each.wanted.empty())
+            continue; // it has none: that is a reason of its own
         reason *made = list->add(each.code.c_str(), group);
         made->who = each.sender;
         made->offered = each.offered;
@@ -285,7 +287,7 @@ static void group_reasons(const snapshot &shown, const snapshot_group &group, re
         add_noted(group.reasons, group.id, list);
         return;
     }
-    if (group.configured && group.interface.empty())
+    if (group.configured && !group.interface_set)
         list->add_state("no-interface", group, "", "");
     else if (group.configured && group.routers_configured == 0)
         list->add_state("no-router", group, "", "");

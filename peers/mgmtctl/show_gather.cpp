@@ -357,6 +357,7 @@ static bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) 
     if (group->configured && !gather_config(work, group, &configured))
         return false;
     group->routers_configured = configured.size();
+    group->interface_set = !group->interface.empty(); // wccpd's text names one in any case
     const std::string root = group_root(NODE_GROUP_STATE, group->id);
     if (work->shown.brief)
         return !in_wccpd ||

@@ -56,7 +56,7 @@ struct snapshot_group {
     // What is configured.
     bool configured = false;
     std::string interface, admin, protocol, encap, assign_method;
-    bool authenticated = false;
+    bool authenticated = false, interface_set = false;
     int64_t weight = -1, priority = -1, policy = -1;
     // What wccpd has.
     bool running = false;
