@@ -1,0 +1,192 @@
+#!/bin/bash
+# The Debian package on a system of its own: built, checked by lintian, installed under systemd, which is the first process
+# of its namespaces; the three programs run with few privileges and a group becomes active; what is killed or hangs is
+# restarted, an upgrade and a reboot keep the configuration, and a purge leaves nothing.
+#   scenario_package.sh [DIRECTORY_OF_THE_PROGRAMS]    of wccp_router
+#
+#   WCCP_PACKAGE    a directory in which the package has been built already
+#
+# The system is this machine's root below an overlay in memory, without the services that are enabled in it: nothing is
+# written outside build/package. What is built there is kept, and the next run builds what has changed. Needs root.
+set -u
+top=$(cd "$(dirname "$0")/.." && pwd)
+bin=$(readlink -f "${1:-$top/build/release/bin}")
+work=${WCCP_PACKAGE:-$top/build/package}
+export LC_ALL=C TERM=dumb
+
+die() {
+    echo "$*" >&2
+    [ -z "${init-}" ] || { inside systemctl --no-pager --lines=0 status 'wccp*' mgmtd tunneld; inside journalctl --no-pager -qn 40; } >&2
+    exit 1
+}
+skip() { echo "skipped: $*"; exit 77; }
+
+# ---- outside: the package, and namespaces that end with this script
+
+if [ "${2-}" != --inside ]; then
+    [ "$(id -u)" = 0 ] || skip "needs root"
+    grep -qw overlay /proc/filesystems || modprobe overlay 2>/dev/null || skip "no overlay file system"
+    groups=$(findmnt -t cgroup2 -no TARGET | head -n 1)
+    [ -n "$groups" ] && [ -w "$groups/cgroup.procs" ] || skip "no control groups of version 2"
+    [ -x /lib/systemd/systemd ] || skip "no systemd"
+    if [ -z "${WCCP_PACKAGE-}" ]; then
+        mkdir -p "$work/src"
+        cd "$top" && git ls-files -co --exclude-standard -z | xargs -0 cp -pu --parents -t "$work/src" 2>/dev/null
+        # Known once, the objects are those of the last run, or of ccache.
+        export CCACHE_DIR=${CCACHE_DIR:-$HOME/.cache/ccache} CCACHE_BASEDIR=$work CCACHE_NOHASHDIR=1
+        ! command -v ccache >/dev/null || export CMAKE_CXX_COMPILER_LAUNCHER=ccache
+        (cd "$work/src" && rm -rf debian/wccpd debian/.debhelper debian/debhelper-build-stamp &&
+            DEB_BUILD_OPTIONS=noautodbgsym dpkg-buildpackage -b -us -uc -nc "-j$(nproc)") >"$work/build.log" 2>&1 ||
+            { tail -n 30 "$work/build.log"; die "no package"; }
+    fi
+    if command -v lintian >/dev/null; then
+        lintian --allow-root --fail-on error,warning,info "$work"/wccpd_*.changes || die "lintian is not content"
+    fi
+    group=$groups/wccp-package-$$
+    mkdir "$group" && echo $$ >"$group/cgroup.procs" || die "no control group"
+    # shellcheck disable=SC2064
+    trap "echo $$ >'$groups/cgroup.procs'; find '$group' -depth -type d -exec rmdir {} + 2>/dev/null" EXIT
+    setpriv --pdeathsig KILL unshare --mount --net --pid --fork --kill-child --cgroup --propagation private --mount-proc \
+        "$0" "$bin" --inside
+    status=$?
+    for ((i = 0; i < 50; i++)); do
+        [ "$(cat "$group/cgroup.procs" | wc -l)" -gt 2 ] || break # the ends of what was killed
+        sleep 0.1
+    done
+    exit $status
+fi
+
+# ---- inside: a router on eth1, and the system, whose first process is `init`
+
+here=/mnt
+mount -t tmpfs tmpfs $here && mkdir $here/upper $here/work $here/root || die "no file system"
+mount -t overlay overlay $here/root -o lowerdir=/,upperdir=$here/upper,workdir=$here/work || skip "no overlay over this root"
+find $here/root/etc/systemd/system $here/root/lib/systemd/system/*.wants -mindepth 1 -delete 2>/dev/null
+rm -rf $here/root/usr/sbin/policy-rc.d $here/root/{etc/wccpd,etc/opt/rvl,etc/rc?.d,var/opt/rvl,var/log/journal}
+for unit in systemd-sysctl systemd-udevd systemd-modules-load systemd-logind systemd-networkd; do
+    ln -s /dev/null "$here/root/etc/systemd/system/$unit.service"
+done
+: >$here/root/etc/machine-id
+
+cat >$here/boot <<'BOOT'
+mount -t proc proc $1/proc && mount -t sysfs -o ro sysfs $1/sys && mount -t cgroup2 cgroup2 $1/sys/fs/cgroup || exit
+mount -t tmpfs -o mode=755 tmpfs $1/run && mount -t tmpfs -o mode=1777 tmpfs $1/tmp || exit
+mount -t tmpfs -o mode=755 tmpfs $1/mnt && mkdir $1/mnt/dev $1/mnt/dev/net || exit
+for node in null zero full random urandom tty net/tun; do
+    [ ! -e /dev/$node ] || { : >$1/mnt/dev/$node && mount --bind /dev/$node $1/mnt/dev/$node; }
+done
+ln -s /proc/self/fd $1/mnt/dev/fd; mkdir $1/mnt/dev/pts $1/mnt/dev/shm
+mount --move $1/mnt/dev $1/dev 2>/dev/null || mount --rbind $1/mnt/dev $1/dev
+ip link set lo up
+cd $1 && exec env -i container=lab PATH=/usr/sbin:/usr/bin:/sbin:/bin chroot $1 /lib/systemd/systemd --unit=multi-user.target --log-target=null
+BOOT
+boot() {
+    unshare --mount --net --pid --ipc --uts --cgroup --fork --kill-child --propagation private \
+        bash $here/boot $here/root </dev/null >$here/boot.log 2>&1 &
+    local outer=$!
+    until_true 10 eval 'init=$(pgrep -P '$outer') && [ "$(cat /proc/$init/comm)" = systemd ]' || { cat $here/boot.log; die "no boot"; }
+    ip link add eth0 netns "$init" type veth peer name eth1
+    ip address add 10.0.0.1/24 dev eth1 && ip link set eth1 up
+    inside ip address add 10.0.0.101/24 dev eth0 && inside ip link set eth0 up
+    until_true 20 eval 'inside systemctl is-system-running 2>/dev/null | grep -qE "running|degraded"' || die "it does not come up"
+}
+inside() { nsenter -t "$init" --mount --net --pid --ipc --uts --cgroup --root --wd=/ env -i PATH=/usr/sbin:/usr/bin:/sbin:/bin LC_ALL=C "$@"; }
+until_true() { # SECONDS COMMAND...
+    local end=$((SECONDS + $1)); shift
+    until "$@" >/dev/null 2>&1; do [ $SECONDS -lt $end ] || return 1; sleep 0.1; done
+}
+is_up() { # UNIT... : active, and ready
+    local unit
+    for unit; do [ "$(inside systemctl show -P SubState "$unit")" = running ] || return; done
+}
+pid() { inside systemctl show -P MainPID "$1"; }
+anew() { # SECONDS UNIT OLD_PID : it runs again
+    until_true "$1" eval "is_up $2 && [ \$(pid $2) != $3 ]" || die "$2 is not started again"
+}
+ctl() { inside mgmtctl "$@"; }
+active() { until_true "$1" eval 'ctl get /qv/alarms/state/role/51 | grep -q ACTIVE' || die "the group is not active"; }
+install() { inside dpkg --install "$1" >$here/dpkg.log 2>&1 || { cat $here/dpkg.log; die "dpkg"; }; }
+services=(mgmtd tunneld wccpd)
+
+ip link set lo up
+boot
+"$bin/wccp_router" --control $here/r1.ctl --address 10.0.0.1 >$here/r1.log 2>&1 &
+mkdir $here/root/root/deb && cp "$work"/wccpd_*.deb $here/root/root/deb/old.deb
+install /root/deb/old.deb
+is_up "${services[@]}" || die "not up after the installation"
+
+# The README's commands.
+ctl group add 51 interface eth0 router 10.0.0.1 || die "no group"
+ctl intercept add 51 port 80 to 3129 || die "no intercept"
+active 60
+ctl show | grep -q '^51 *ACTIVE' || die "$(ctl show)"
+
+for unit in "${services[@]}"; do
+    inside systemd-analyze security --no-pager "$unit" >$here/security 2>&1
+    level=$(sed -n 's/.*exposure level for .*: \([0-9.]*\) .*/\1/p' $here/security)
+    echo "$unit: exposure $level"
+    [ -n "$level" ] && awk "BEGIN { exit !($level < 3.0) }" || { cat $here/security; die "$unit has too many privileges"; }
+done
+
+# tunneld is replaced before anybody hears of it; one that ends in order takes wccpd with it. What hangs is ended.
+before=$(pid wccpd) old=$(pid tunneld)
+inside systemctl kill -s KILL tunneld
+anew 10 tunneld "$old"
+until_true 10 eval 'inside journalctl -qu mgmtd | grep "process tunneld: its session is lost, replaced after"' || die "mgmtd has not seen it"
+sleep 3.5
+[ "$(pid wccpd)" = "$before" ] || die "wccpd has noticed"
+inside systemctl restart tunneld
+anew 10 wccpd "$before"
+for unit in wccpd mgmtd; do
+    old=$(pid $unit)
+    inside systemctl kill -s KILL $unit
+    anew 20 $unit "$old"
+done
+until_true 20 is_up wccpd || die "wccpd does not follow its mgmtd"
+for unit in "${services[@]}"; do
+    mkdir -p $here/root/etc/systemd/system/$unit.service.d
+    printf '[Service]\nWatchdogSec=1\n' >$here/root/etc/systemd/system/$unit.service.d/quick.conf
+done
+inside systemctl daemon-reload
+inside systemctl restart mgmtd tunneld wccpd
+sleep 3
+is_up "${services[@]}" && [ "$(inside systemctl show -P NRestarts "${services[@]}" | xargs)" = '0 0 0' ] || die "a watchdog bites by itself"
+for unit in tunneld wccpd mgmtd; do
+    old=$(pid $unit)
+    inside systemctl kill -s STOP $unit
+    anew 20 $unit "$old"
+done
+rm -r $here/root/etc/systemd/system/*.service.d
+inside systemctl daemon-reload
+
+# An upgrade, and a reboot.
+echo '# edited' >>$here/root/etc/opt/rvl/platform.conf
+cp $here/root/etc/wccpd/mgmtd.conf $here/conf
+mkdir $here/new && dpkg-deb -R "$work"/wccpd_*.deb $here/new && sed -i 's/^Version: .*/&+1/' $here/new/DEBIAN/control &&
+    dpkg-deb --root-owner-group -b $here/new $here/root/root/deb/new.deb >/dev/null || die "no newer package"
+until_true 20 is_up "${services[@]}"
+old=$(pid wccpd)
+install /root/deb/new.deb
+anew 20 wccpd "$old"
+kept() {
+    cmp -s $here/conf $here/root/etc/wccpd/mgmtd.conf && grep -q '# edited' $here/root/etc/opt/rvl/platform.conf &&
+        [ "$(stat -c %a $here/root/etc/wccpd/mgmtd.conf)" = 600 ] && is_up "${services[@]}"
+}
+kept || die "the upgrade has changed the configuration"
+inside systemctl poweroff --force >/dev/null 2>&1
+until_true 30 eval '! kill -0 $init' || die "it does not end"
+ip link del eth1 2>/dev/null
+boot
+until_true 20 kept || die "after the reboot"
+active 60
+
+inside systemctl stop wccp.target
+until_true 20 eval '[ "$(inside systemctl is-active "${services[@]}" | sort -u)" = inactive ]' || die "not stopped with the target"
+inside systemctl start wccp.target && until_true 20 is_up "${services[@]}" || die "not started with the target"
+
+inside dpkg --purge wccpd >$here/dpkg.log 2>&1 || { cat $here/dpkg.log; die "dpkg"; }
+! inside pgrep -x 'wccpd|tunneld|mgmtd' || die "left running"
+left=$(cd $here/root && ls -d etc/wccpd etc/opt/rvl var/opt/rvl run/tunneld run/wccpd.pid run/mgmtd.lock usr/sbin/wccpd \
+    etc/systemd/system/*.wants/{wccp,mgmtd,tunneld}* tmp/gcl-socks/* 2>/dev/null
+    inside sh -c 'ls -d /run/tunneld /run/wccpd.pid /run/mgmtd.lock /tmp/gcl-socks/* 2>/dev/null; ip -o link show group 2048')
+[ -z "$left" ] || die "left after the purge: $left"
