@@ -16,7 +16,7 @@ export LC_ALL=C TERM=dumb
 
 die() {
     echo "$*" >&2
-    [ -z "${init-}" ] || { inside systemctl --no-pager --lines=0 status 'wccp*' mgmtd tunneld; inside journalctl --no-pager -qn 40; } >&2
+    [ -z "${init-}" ] || { inside systemctl --no-pager --lines=0 status 'wccp*' mgmtd tunneld; inside mgmtctl show; inside journalctl --no-pager -qn 40; cat $here/r1.log; } >&2
     exit 1
 }
 skip() { echo "skipped: $*"; exit 77; }
@@ -61,7 +61,7 @@ fi
 here=/mnt
 mount -t tmpfs tmpfs $here && mkdir $here/upper $here/work $here/root || die "no file system"
 mount -t overlay overlay $here/root -o lowerdir=/,upperdir=$here/upper,workdir=$here/work || skip "no overlay over this root"
-find $here/root/etc/systemd/system $here/root/lib/systemd/system/*.wants -mindepth 1 -delete 2>/dev/null
+find $here/root/etc/systemd/system -mindepth 1 -delete 2>/dev/null
 rm -rf $here/root/usr/sbin/policy-rc.d $here/root/{etc/wccpd,etc/opt/rvl,etc/rc?.d,var/opt/rvl,var/log/journal}
 for unit in systemd-sysctl systemd-udevd systemd-modules-load systemd-logind systemd-networkd; do
     ln -s /dev/null "$here/root/etc/systemd/system/$unit.service"
@@ -75,10 +75,11 @@ mount -t tmpfs -o mode=755 tmpfs $1/mnt && mkdir $1/mnt/dev $1/mnt/dev/net || ex
 for node in null zero full random urandom tty net/tun; do
     [ ! -e /dev/$node ] || { : >$1/mnt/dev/$node && mount --bind /dev/$node $1/mnt/dev/$node; }
 done
-ln -s /proc/self/fd $1/mnt/dev/fd; mkdir $1/mnt/dev/pts $1/mnt/dev/shm
+ln -s /proc/self/fd $1/mnt/dev/fd; ln -s pts/ptmx $1/mnt/dev/ptmx; mkdir $1/mnt/dev/pts $1/mnt/dev/shm
+mount -t devpts -o newinstance,ptmxmode=666 devpts $1/mnt/dev/pts
 mount --move $1/mnt/dev $1/dev 2>/dev/null || mount --rbind $1/mnt/dev $1/dev
 ip link set lo up
-cd $1 && exec env -i container=lab PATH=/usr/sbin:/usr/bin:/sbin:/bin chroot $1 /lib/systemd/systemd --unit=multi-user.target --log-target=null
+cd $1 && exec env -i container=lab PATH=/usr/sbin:/usr/bin:/sbin:/bin chroot $1 /lib/systemd/systemd --unit=multi-user.target --log-target=journal
 BOOT
 boot() {
     unshare --mount --net --pid --ipc --uts --cgroup --fork --kill-child --propagation private \
@@ -104,21 +105,25 @@ anew() { # SECONDS UNIT OLD_PID : it runs again
     until_true "$1" eval "is_up $2 && [ \$(pid $2) != $3 ]" || die "$2 is not started again"
 }
 ctl() { inside mgmtctl "$@"; }
-active() { until_true "$1" eval 'ctl get /qv/alarms/state/role/51 | grep -q ACTIVE' || die "the group is not active"; }
+active() { until_true "$1" eval 'sleep 0.4; ctl get /qv/alarms/state/role/51 | grep -q ACTIVE' || die "the group is not active"; }
 install() { inside dpkg --install "$1" >$here/dpkg.log 2>&1 || { cat $here/dpkg.log; die "dpkg"; }; }
 services=(mgmtd tunneld wccpd)
 
 ip link set lo up
+# The protocol of wccpd and the router runs eight times as fast as the wall's clock.
+fast=("LD_PRELOAD=$bin/../lib/libfast_clock.so" FAST_CLOCK=8)
+mkdir -p $here/root/etc/systemd/system/wccpd.service.d && cp "$bin/../lib/libfast_clock.so" $here/root/usr/lib/
+printf '[Service]\nEnvironment=LD_PRELOAD=/usr/lib/libfast_clock.so FAST_CLOCK=8\n' >$here/root/etc/systemd/system/wccpd.service.d/fast.conf
 boot
-"$bin/wccp_router" --control $here/r1.ctl --address 10.0.0.1 >$here/r1.log 2>&1 &
+env "${fast[@]}" "$bin/wccp_router" --control $here/r1.ctl --router 10.0.0.1 >$here/r1.log 2>&1 &
 mkdir $here/root/root/deb && cp "$work"/wccpd_*.deb $here/root/root/deb/old.deb
 install /root/deb/old.deb
 is_up "${services[@]}" || die "not up after the installation"
 
 # The README's commands.
 ctl group add 51 interface eth0 router 10.0.0.1 || die "no group"
-ctl intercept add 51 port 80 to 3129 || die "no intercept"
-active 60
+ctl intercept add 51 port 80 to 3129 leave-after 0 || die "no intercept"
+active 30
 ctl show | grep -q '^51 *ACTIVE' || die "$(ctl show)"
 
 for unit in "${services[@]}"; do
@@ -156,7 +161,7 @@ for unit in tunneld wccpd mgmtd; do
     inside systemctl kill -s STOP $unit
     anew 20 $unit "$old"
 done
-rm -r $here/root/etc/systemd/system/*.service.d
+rm $here/root/etc/systemd/system/*.service.d/quick.conf
 inside systemctl daemon-reload
 
 # An upgrade, and a reboot.
@@ -178,7 +183,7 @@ until_true 30 eval '! kill -0 $init' || die "it does not end"
 ip link del eth1 2>/dev/null
 boot
 until_true 20 kept || die "after the reboot"
-active 60
+active 30
 
 inside systemctl stop wccp.target
 until_true 20 eval '[ "$(inside systemctl is-active "${services[@]}" | sort -u)" = inactive ]' || die "not stopped with the target"
