@@ -3,12 +3,12 @@
 # under release and under the address and undefined-behaviour sanitizers, those with threads under the thread
 # sanitizer, a short run of each fuzzer, and what needs Debian's own kernel in a virtual machine. Installs what is
 # missing; leaves nothing but build/.
-#   test.sh [STEP...]   only these steps, of: form release asan tsan clang tidy fuzz vm
+#   test.sh [STEP...]   only these steps, of: form release asan tsan clang tidy fuzz package vm
 set -u
 cd "$(dirname "$0")/.." || exit 1
 scripts/install-deps.sh build lab test || exit 1
 jobs=$(nproc)
-steps=("$@"); [ $# -gt 0 ] || steps=(form release asan tsan clang fuzz vm)
+steps=("$@"); [ $# -gt 0 ] || steps=(form release asan tsan clang fuzz package vm)
 passed=0 failed=0
 declare -a bad=() second=()
 
@@ -40,6 +40,13 @@ run_ctest() { # PRESET ARGUMENTS...
     passed=$((passed + ${total:-0} - ${fails:-0})); failed=$((failed + ${fails:-0}))
     if [ $status -ne 0 ]; then bad+=("tests under $preset"); [ "${fails:-0}" -gt 0 ] || failed=$((failed + 1)); fi
 }
+run_package() {
+    scripts/install-deps.sh package >build/package.log 2>&1 || { tail -n 3 build/package.log; result "tools for the package" 1; return; }
+    build release wccp_router fast_clock || { result "build for the package" 1; return; }
+    tests/scenario_package.sh
+    local status=$?
+    [ $status = 77 ] || result "package" $status
+}
 run_vm() {
     if ! scripts/install-deps.sh vm >build/vm.log 2>&1; then
         tail -n 3 build/vm.log
@@ -69,6 +76,7 @@ for step in "${steps[@]}"; do
     tidy) cmake --preset clang >/dev/null && sources | grep '\.cpp$' | grep -vE '^(tests|bench|fuzz)/' |
         xargs -P "$jobs" -n 1 clang-tidy-14 --quiet -p build/clang; result "clang-tidy" $? ;;
     fuzz) scripts/fuzz.sh 15; result "fuzzing" $? ;;
+    package) run_package ;;
     vm) run_vm ;;
     *) echo "test.sh: no step $step" >&2; exit 2 ;;
     esac

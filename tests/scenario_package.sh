@@ -122,7 +122,7 @@ is_up "${services[@]}" || die "not up after the installation"
 
 # The README's commands.
 ctl group add 51 interface eth0 router 10.0.0.1 || die "no group"
-ctl intercept add 51 port 80 to 3129 leave-after 0 || die "no intercept"
+ctl intercept add 51 port 80 to 3129 leave 0 || die "no intercept"
 active 30
 ctl show | grep -q '^51 *ACTIVE' || die "$(ctl show)"
 
@@ -190,8 +190,8 @@ until_true 20 eval '[ "$(inside systemctl is-active "${services[@]}" | sort -u)"
 inside systemctl start wccp.target && until_true 20 is_up "${services[@]}" || die "not started with the target"
 
 inside dpkg --purge wccpd >$here/dpkg.log 2>&1 || { cat $here/dpkg.log; die "dpkg"; }
-! inside pgrep -x 'wccpd|tunneld|mgmtd' || die "left running"
+! inside ps -A -o comm= | grep -qxE 'wccpd|tunneld|mgmtd' || die "left running"
 left=$(cd $here/root && ls -d etc/wccpd etc/opt/rvl var/opt/rvl run/tunneld run/wccpd.pid run/mgmtd.lock usr/sbin/wccpd \
     etc/systemd/system/*.wants/{wccp,mgmtd,tunneld}* tmp/gcl-socks/* 2>/dev/null
-    inside sh -c 'ls -d /run/tunneld /run/wccpd.pid /run/mgmtd.lock /tmp/gcl-socks/* 2>/dev/null; ip -o link show group 2048')
+    inside sh -c 'cd /; ls -d /run/tunneld /run/wccpd.pid /run/mgmtd.lock /tmp/gcl-socks/* 2>/dev/null; ip -o link show group 2048')
 [ -z "$left" ] || die "left after the purge: $left"
