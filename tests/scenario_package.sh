@@ -31,11 +31,12 @@ if [ "${2-}" != --inside ]; then
     [ -x /lib/systemd/systemd ] || skip "no systemd"
     if [ -z "${WCCP_PACKAGE-}" ]; then
         mkdir -p "$work/src"
-        cd "$top" && git ls-files -co --exclude-standard -z | xargs -0 cp -pu --parents -t "$work/src" 2>/dev/null
+        find "$work/src" -mindepth 1 -maxdepth 1 ! -name 'obj-*' -exec rm -rf {} +
+        cd "$top" && git ls-files -co --exclude-standard -z | xargs -0 cp -p --parents -t "$work/src" 2>/dev/null
         # Known once, the objects are those of the last run, or of ccache.
         export CCACHE_DIR=${CCACHE_DIR:-$HOME/.cache/ccache} CCACHE_BASEDIR=$work CCACHE_NOHASHDIR=1
         ! command -v ccache >/dev/null || export CMAKE_CXX_COMPILER_LAUNCHER=ccache
-        (cd "$work/src" && rm -rf debian/wccpd debian/.debhelper debian/debhelper-build-stamp &&
+        (cd "$work/src" &&
             DEB_BUILD_OPTIONS=noautodbgsym dpkg-buildpackage -b -us -uc -nc "-j$(nproc)") >"$work/build.log" 2>&1 ||
             { tail -n 30 "$work/build.log"; die "no package"; }
     fi
@@ -91,7 +92,7 @@ boot() {
     inside ip address add 10.0.0.101/24 dev eth0 && inside ip link set eth0 up
     until_true 20 eval 'inside systemctl is-system-running 2>/dev/null | grep -qE "running|degraded"' || die "it does not come up"
 }
-inside() { nsenter -t "$init" --mount --net --pid --ipc --uts --cgroup --root --wd=/ env -i PATH=/usr/sbin:/usr/bin:/sbin:/bin LC_ALL=C "$@"; }
+inside() { nsenter -t "$init" --mount --net --pid --ipc --uts --cgroup --root --wdns=/ env -i PATH=/usr/sbin:/usr/bin:/sbin:/bin LC_ALL=C "$@"; }
 until_true() { # SECONDS COMMAND...
     local end=$((SECONDS + $1)); shift
     until "$@" >/dev/null 2>&1; do [ $SECONDS -lt $end ] || return 1; sleep 0.1; done
