@@ -1,11 +1,12 @@
 #!/bin/bash
 # demo.sh [--capture FILE] [--plain] [--speed N] [--no-build]
-# A client, a server, a router that redirects, and two appliances with a proxy each, in namespaces of their own: the
-# appliances join, the designated one shares 256 hash buckets by weight, and pages that the client fetches come through
-# the proxies in these shares. Then the proxy of one is killed, and starts again; then the whole appliance dies. The
-# fetches go on. On a terminal `mgmtctl show --watch` of the appliance that survives stays on the screen, below what is
-# awaited, for how long, and by whom the last pages came; without one there is a line for each step. Takes some 50
-# seconds, installs and builds what is missing, leaves nothing running.
+# A client, a server, a router that redirects, and two appliances with a proxy each, in namespaces of their own: one
+# joins, and downloads run through it; the other joins, the designated one shares 256 hash buckets by weight, and pages
+# that the client fetches come through the proxies in these shares, while the downloads go on. Then the proxy of one is
+# killed, and starts again; then the whole appliance dies. The fetches go on. On a terminal `mgmtctl show --watch` of the
+# appliance that survives stays on the screen, below what is awaited, for how long, and by whom the last pages came;
+# without one there is a line for each step. Takes some 70 seconds, installs and builds what is missing, leaves nothing
+# running.
 #   --capture FILE   keep the packets of the protocol and of redirected flows, for tshark or wireshark
 #   --plain          lines, on a terminal as well
 #   --speed N        all protocol times N times as fast (default 2)
@@ -24,7 +25,7 @@ while [ $# -gt 0 ]; do
         [[ ${2?a number} =~ ^[1-9][0-9]*(\.[0-9]+)?$ ]] || { echo "demo: a speed of $2?" >&2; exit 2; }
         export LAB_SPEED=$2; shift 2 ;;
     --no-build) build=''; shift ;;
-    *) sed -n '2,12s/^# \{0,1\}//p' "$0"; exit 2 ;;
+    *) sed -n '2,13s/^# \{0,1\}//p' "$0"; exit 2 ;;
     esac
 done
 own_rows=7
@@ -137,6 +138,23 @@ browse() {
     fetch_pages 120 1
     say "  c1: $pages"
 }
+# They last while a1 joins: some twenty protocol seconds longer than that takes.
+downloads=16
+begin_downloads() {
+    local rate=100000
+    nsenter -t "${LAB_INIT[c1]}" --net "$WCCP_BIN/wccp_router" fetch --from 10.1.0.128 10.2.0.2 --sources $downloads \
+        --count $downloads --parallel $downloads --rate $rate --size "$((rate * 1000 * 48 / speed_milli + rate * 3))" \
+        </dev/null >"$LAB/downloads" 2>>"$LAB/c1.out" &
+    LAB_PID[c1/downloads]=$!
+    say "  c1: $downloads downloads begin, $((rate / 1000)) kB/s each"
+}
+downloads_are_over() { ! lab_alive c1 downloads; }
+tell_downloads() {
+    local passed
+    passed=$(lab_manage a1 get /qv/tunneld/protection/state/passed | jq -r '[.. | .value? // empty][0]')
+    say "  c1: of $downloads downloads $(jq -r '"\(.fetched) complete, \(.failed) broken; by a2 \(.proxies.a2 // 0)"' "$LAB/downloads"); a1 passed $passed packets of them to a2"
+    [ "$(jq .failed "$LAB/downloads")" = 0 ] || lab_die "downloads broke: $(cat "$LAB/downloads")"
+}
 fact() { # GROUP : in a line
     # shellcheck disable=SC2016
     say "  $(jq -r --argjson id "$1" --arg node $survivor '
@@ -234,21 +252,31 @@ for a in a1 a2; do
 done
 live begins
 browse
+join() { # APPLIANCE
+    operate "$1" group add 51 interface eth0 router ${address[r1]} weight "${weight[$1]}" assign hash
+    operate "$1" intercept add 51 port 80 to 3129 interval 2 fall 2 rise 1
+}
 tell_step 'Here-I-Am, I-See-You: an appliance is in once it has echoed what the router sent'
-for a in a2 a1; do
-    operate $a group add 51 interface eth0 router ${address[r1]} weight "${weight[$a]}" assign hash
-    operate $a intercept add 51 port 80 to 3129 interval 2 fall 2 rise 1
-    [ $a = a1 ] || lab_sleep 1.2 # a1 hears of a2 with its own second I-See-You when a2 speaks first; else ten seconds later
-done
+join a2
+await 30 11 'a2 at the router' members_are 1
+await 40 17 'the first hash table' group_is "$shares == [100]"
+await 10 1 'pages from the proxy of a2' pages_are '.proxies | keys == ["a2"]'
+browse
+tell_step 'Downloads begin, through the only proxy; a1 joins'
+begin_downloads
+join a1
 await 30 11 'both appliances at the router' members_are 2
 tell_step 'a1 has the lowest address: it is elected, and makes the table'
-await 40 17 'the first hash table' group_is "$shares == [37, 62]"
+await 40 17 'a table for both' group_is "$shares == [37, 62]"
 fact 51
 await 10 1 'pages from both proxies' pages_are '.proxies | .a1 > 0 and .a2 > 0 and (has("") | not)'
 typed=('' '')
+lab_ctl r1 traffic reset >"$LAB/traffic"
 browse
 lab_ctl r1 traffic >"$LAB/traffic"
 say "  r1: $(jq -r '{"10.0.0.101": "a1", "10.0.0.102": "a2"} as $names | .appliances | (map(.flows) | add) as $all | to_entries | map("\($names[.key]) \(.value.flows) flows (\(100 * .value.flows / $all | round)%)") | join(", ")' "$LAB/traffic"); weights ${weight[a1]} and ${weight[a2]}"
+await 40 10 'the end of the downloads' downloads_are_over
+tell_downloads
 
 tell_step 'The proxy of a1 is killed: a1 gives its flows back, and they go to the server'
 lab_stop a1 proxy KILL 2>/dev/null # no word of the shell's

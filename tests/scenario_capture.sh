@@ -17,6 +17,7 @@ fail() { echo "FAILED: $*"; failed=1; }
 cat "$scratch/out"
 for line in '  group 51: a2 is ACTIVE; hash: a1 96, a2 160; asked 38%, 63%; has 37%, 62%' \
     '  c1: of 120 pages a1 45 (38%)  a2 75 (63%)  server alone 0 (0%)  none 0' '  r1: a1 .* (3[78]%), a2 .* (6[23]%); weights 60 and 100' \
+    '  c1: of 16 downloads 16 complete, 0 broken; by a2 16; a1 passed [1-9]' \
     '  c1: of 120 pages a1 0 (0%)  a2 75 (63%)  server alone 45 (38%)  none 0' \
     '  c1: of 120 pages a1 0 (0%)  a2 120 (100%)  server alone 0 (0%)  none 0' '51  ACTIVE, designated  up .*  weight 100'; do
     grep -q "$line" "$scratch/out" || fail "the demo does not say: $line"

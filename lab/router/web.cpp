@@ -82,12 +82,19 @@ struct stream {
     int fd;
     std::string waiting; // read and not used
     const char *wrong = "";
+    double rate = 0; // bytes a second at most, 0: no limit
 };
+static void pause_for(double seconds) {
+    if (seconds > 0)
+        usleep(static_cast<useconds_t>(seconds * 1e6));
+}
 static bool read_more(stream *in) {
     char part[PIECE];
     const ssize_t got = recv(in->fd, part, sizeof part, 0);
     if (got > 0) {
         in->waiting.append(part, static_cast<size_t>(got));
+        if (in->rate > 0)
+            pause_for(static_cast<double>(got) / in->rate);
         return true;
     }
     in->wrong = got == 0 ? "closed" : errno == EAGAIN ? "timeout" : errno == ECONNRESET ? "reset" : "read";
@@ -218,10 +225,6 @@ static const char *connect_from(int fd, const fetch_options &options, uint32_t s
         return nullptr;
     return errno == EINPROGRESS ? "connect timeout" : errno == ECONNREFUSED ? "refused" : "connect";
 }
-static void pause_for(double seconds) {
-    if (seconds > 0)
-        usleep(static_cast<useconds_t>(seconds * 1e6));
-}
 static std::string request_of(const fetch_options &options) {
     const bool post = options.upload > 0;
     return std::string(post ? "POST /upload" : "GET /" + std::to_string(options.size)) +
@@ -251,8 +254,11 @@ static fetched fetch_once(const fetch_options &options, uint32_t source) {
     const double began = wall_seconds();
     const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     set_limits(fd, options.timeout);
+    const int little = 32768; // what comes faster than it is read waits at the sender
+    if (options.rate > 0)
+        setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &little, sizeof little);
     one.wrong = connect_from(fd, options, source);
-    stream in = {fd, "", ""};
+    stream in = {fd, "", "", options.rate};
     const std::string request = request_of(options);
     for (uint32_t i = 0; i < options.requests && !one.wrong; i++) {
         if (i > 0)
@@ -439,6 +445,7 @@ void add_fetch_options(CLI::App *app, fetch_options *options) {
     app->add_option("--timeout", options->timeout, "seconds of silence that a fetch survives");
     app->add_option("--seconds", options->seconds, "go on for so long, whatever --count says");
     app->add_option("--pause", options->pause, "seconds after each request");
+    app->add_option("--rate", options->rate, "bytes a second that each connection reads");
     app->add_option("--long", options->long_lived,
                     "so many connections that last, with a request per second on each")
         ->check(CLI::Range(1, 4096));

@@ -31,6 +31,7 @@ struct fetch_options {
     double timeout = 5;      // of each step of a fetch, in seconds
     double seconds = 0;      // go on for so long, whatever `count` says
     double pause = 0;        // seconds after each request
+    double rate = 0;         // bytes a second that each connection reads, 0: as they come
     uint32_t long_lived = 0; // connections that last instead of fetches, with a request per second on each
     uint32_t life = 5;       // requests on each of them once SIGUSR1 has come
 };
