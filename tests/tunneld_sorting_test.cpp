@@ -560,11 +560,12 @@ TEST_F(Sorting, OuterPacketsAreCounted) {
 // nothing; a table that somebody else has removed comes back.
 TEST_F(Sorting, ChangesAreWholeOrNone) {
     wanted_sorting wanted = make_wanted();
+    wanted.members.clear();
     std::string error;
     EXPECT_TRUE(remove_sorting_rules(&error)) << error;
     const pid_t child = fork();
     if (child == 0) {
-        wanted_sorting earlier = make_wanted();
+        wanted_sorting earlier = wanted;
         earlier.links = {"wccp0", "wccp9"};
         earlier.groups[0].interfaces.push_back("wccp9");
         earlier.groups.push_back(make_group(9, 6, {}));
