@@ -299,6 +299,11 @@ static void group_reasons(const snapshot &shown, const snapshot_group &group, re
     if (!group.configured)
         list->add_state("not-configured", group, "", "");
     add_noted(group.reasons, group.id, list);
+    // What is wrong with a packet before its group is known is about each group of its sender.
+    for (const snapshot_reason &each : shown.reasons)
+        for (const snapshot_router &router : group.routers)
+            if (router.address == each.sender && each.code.starts_with("message-"))
+                add_noted({each}, group.id, list);
     if (shown.brief)
         return;
     unheard_routers(group, list);

@@ -139,7 +139,8 @@ void take_group_text(const std::string &text, snapshot_group *inout) {
         const std::string value(row.value.substr(0, 64));
         if (row.label == "WCCP interfaces" && inout->interface.empty()) {
             const size_t name = value.rfind(' ');
-            inout->interface = clean_text(value.substr(name == std::string::npos ? 0 : name + 1), 15);
+            if (name != std::string::npos && name > 2) // "# 1 eth0"; without a name there is none
+                inout->interface = clean_text(value.substr(name + 1), 15);
         } else if (row.label == "WCCP interface ipa and link") {
             inout->link = value.ends_with(" up") ? "up" : value.ends_with(" down") ? "down" : "";
             first = false;
