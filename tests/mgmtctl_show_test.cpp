@@ -427,6 +427,7 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
                              "  the kernel is not as wanted: wccp0: busy?\n"
                              "  group 51 has left its routers: no good check for 30 s\n"
                              "  group 52: not ACTIVE; new flows are returned\n"
+                             "  group 52 is unprotected: no bucket\n"
                              "  the router redirects this appliance's own traffic\n"
                              "  refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
                              "  packets come in fragments, and the MSS of no flow has been clamped\n"})
