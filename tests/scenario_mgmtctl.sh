@@ -170,6 +170,10 @@ if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
     complains 'mgmtctl: user 65534 may look, but not change anything'
     expect 1 '' rollback 2
     as=()
+    expect 0 '*wccp_group_active{group="51"} 1*# EOF' metrics
+    ctl metrics --http <<<$'HEAD /metrics HTTP/1.1\r\nAccept: text/plain\r\n\r' | grep -q '^Content-Type: text/plain; version=0.0.4' ||
+        fail "no metrics over HTTP"
+    ctl metrics --http <<<$'GET / HTTP/1.1\r\n\r' | grep -q '^HTTP/1.1 404' || fail "metrics of something else"
 fi
 
 # The configuration as a whole
