@@ -72,8 +72,10 @@ bool server_config_text(const server *self, const node_name &name, bool hide, no
     *out = {bn_type_str, ""};
     if (matches(kept, name))
         return kept_text(self, name, hide, &out->text);
+    if (!(name == present)) // the text takes its time, and every node of every query comes by here
+        return false;
     out->text = hide ? hidden_text(self->tree) : config_format(self->tree, self->comments);
-    return name == present;
+    return true;
 }
 
 // --- Keeping

@@ -176,8 +176,8 @@ const std::vector<const char *> &wccpd_state_nodes() {
         NODE_GROUP_STATE "/*/counter/*",
         NODE_GROUP_STATE "/*/debug",
         NODE_GROUP_STATE "/*/assignment",
-        // Below a node that cannot be listed, so that a walk leaves it out.
-        NODE_GROUP_STATE "/*/metric/all",
+        // One that can be listed nowhere, so that a walk leaves it out.
+        NODE_GROUP_STATE "/*/metric/*",
         NODE_GROUP_STATE "/*/owners",
         NODE_GROUP_STATE "/*/router/*",
         NODE_GROUP_STATE "/*/router/*/state",
