@@ -225,7 +225,8 @@ struct Session : Loop {
     int readings = 0, owners_heard = 0;
     std::vector<state_node> states = {{NODE_PLANE_STATE "/name", bn_type_str, "table"},
                                       {NODE_TUNNEL_STATE "/3/index", bn_type_uint32, "7"},
-                                      {NODE_TUNNEL_STATE "/12/index", bn_type_uint32, "8"}};
+                                      {NODE_TUNNEL_STATE "/12/index", bn_type_uint32, "8"},
+                                      {NODE_PROTECTION_STATE "/group/51/slots", bn_type_uint32, "9"}};
 
     void SetUp() override {
         Loop::SetUp();
@@ -410,6 +411,9 @@ TEST_F(Session, AnswersForItsStateAndReports) {
     };
     EXPECT_EQ(ask(NODE_TUNNEL_STATE "/12/index", bn_query_get, 0),
               (strings{NODE_TUNNEL_STATE "/12/index=8", "code 0"}));
+    EXPECT_EQ(
+        ask(NODE_PROTECTION_STATE "/group", bn_query_iterate, bn_qf_subtree),
+        (strings{NODE_PROTECTION_STATE "/group/51=51", NODE_PROTECTION_STATE "/group/51/slots=9", "code 0"}));
     EXPECT_EQ(ask(NODE_TUNNEL_STATE, bn_query_iterate, 0),
               (strings{NODE_TUNNEL_STATE "/3=3", NODE_TUNNEL_STATE "/12=12", "code 0"}));
     EXPECT_EQ(ask(NODE_TUNNEL_STATE, bn_query_iterate, bn_qf_subtree | bn_qf_leaves_only),

@@ -31,7 +31,9 @@ struct state_source {
 
 static const state_source sources[] = {
     {"wccpd", {NODE_WCCPD_STATE, NODE_GROUP_STATE}, wccpd_state_nodes},
-    {"tunneld", {NODE_PLANE_STATE, NODE_TUNNEL_STATE, NODE_INTERCEPT_STATE}, tunneld_state_nodes},
+    {"tunneld",
+     {NODE_PLANE_STATE, NODE_TUNNEL_STATE, NODE_INTERCEPT_STATE, NODE_PROTECTION_STATE},
+     tunneld_state_nodes},
 };
 static constexpr uint32_t CAPABILITIES = 1;       // the nodes can be read
 static constexpr size_t ANSWER_NODE_BYTES = 64;   // of a node in a message, beside its texts
