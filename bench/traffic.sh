@@ -241,7 +241,7 @@ part_protection() {
     lab_appliance a0 10.0.0.90
     lab_gateway a0 10.0.0.1
     lab_appliance_start a0 "$(lab_group 51 10.0.0.1)"
-    lab_wait 60 '.[] | select(.name == "/qv/tunneld/protection/state/group/51/slots") | .value == "128"' \
+    lab_wait 60 '.[] | select(.name == "/qv/tunneld/protection/state/group/51/slots") | .value == 128' \
         lab_manage a1 walk /qv/tunneld/protection/state || die "no other appliance"
     protected on
     rounds protected off on
