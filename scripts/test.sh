@@ -1,8 +1,8 @@
 #!/bin/bash
-# test.sh: everything that a change has to pass, from a bare checkout on Debian 12: the format of the sources and their includes, all tests
-# under release and under the address and undefined-behaviour sanitizers, those with threads under the thread
-# sanitizer, a short run of each fuzzer, and what needs Debian's own kernel in a virtual machine. Installs what is
-# missing; leaves nothing but build/.
+# test.sh: everything that a change has to pass, from a bare checkout on Debian 12: the format of the sources, their
+# includes and what the documents quote, all tests under release and under the address and undefined-behaviour
+# sanitizers, those with threads under the thread sanitizer, a build with clang, a short run of each fuzzer, the Debian
+# package, and what needs Debian's own kernel in a virtual machine. Installs what is missing; leaves nothing but build/.
 #   test.sh [STEP...]   only these steps, of: form release asan tsan clang tidy fuzz package vm
 set -u
 cd "$(dirname "$0")/.." || exit 1
@@ -68,7 +68,8 @@ for step in "${steps[@]}"; do
     case $step in
     form)
         sources | xargs clang-format-14 --dry-run --Werror; result "format of the sources" $?
-        scripts/check-includes.sh; result "includes" $? ;;
+        scripts/check-includes.sh; result "includes" $?
+        scripts/check-docs.sh; result "documents" $? ;;
     release | asan) if build "$step"; then run_ctest "$step"; else result "build of $step" 1; fi ;;
     tsan) if build tsan threaded_tests; then run_ctest tsan -L threads; else result "build of tsan" 1; fi ;;
     clang) build clang; result "build with clang" $? ;;

@@ -1,0 +1,93 @@
+#!/bin/bash
+# check-docs.sh: what the documents quote exists. Quoted is what is in backticks or in an indented block, and the
+# target of a link.
+#   Files     a path that begins with a directory of the tree, and a bare name of a source file or script
+#   mgmtctl   the command is one of peers/mgmtctl/main.cpp; further words and options are texts of its sources
+#   Options   of mgmtd, tunneld and the scripts: words of their sources
+#   Steps     of scripts/test.sh: CONTRIBUTING.md has each
+set -eu
+cd "$(dirname "$0")/.."
+documents=(README.md CONTRIBUTING.md CHANGELOG.md docs/*.md)
+tree=$(git ls-files -co --exclude-standard)
+directories=$(sed -n 's,/.*,,p' <<<"$tree" | grep -v '^\.' | sort -u | paste -sd'|')
+ctl_sources=(peers/mgmtctl/*.cpp peers/nodes/*.cpp)
+status=0
+missing() { # DOCUMENT WHAT
+    echo "$1: $2"
+    status=1
+}
+
+# One quotation a line. A "|" of a table is written "\|".
+quotations() { # DOCUMENT
+    sed -n 's/\\|/|/g; s/^    \(.*\)/\1/p; t' "$1"
+    grep -v '^    ' "$1" | sed 's/\\|/|/g' | grep -oE '`[^`]+`' | tr -d '`' || true
+}
+
+check_files() { # DOCUMENT
+    local path
+    while read -r path; do
+        path=${path%[./]}
+        # shellcheck disable=SC2086 # a pattern
+        compgen -G "$path" >/dev/null || missing "$1" "there is no file $path"
+    done < <(quotations "$1" | grep -oP "(?<![\w./~*{-])($directories)/[\w./*-]*" | sort -u)
+    while read -r path; do
+        grep -qE "(^|/)$path\$" <<<"$tree" || missing "$1" "there is no file $path"
+    done < <(quotations "$1" | grep -oP '(?<![\w./*-])[a-z][\w-]*\.(cpp|h|sh)(?![\w(])' | sort -u)
+    while read -r path; do
+        [ -e "$(dirname "$1")/$path" ] || missing "$1" "the link to $path leads nowhere"
+    done < <(grep -oP '\]\(\K[^)#:]+(?=[)#])' "$1" | sort -u)
+}
+
+is_text_of() { # WORD FILE... : as a whole text, or a word of one that lists words
+    grep -qE "\"([^\"]*[ ,:[|])?$1([] ,:|=][^\"]*)?\"" "${@:2}"
+}
+commands=$(sed -n 's/.*add_command([a-z]*, "\([a-z]*\)".*/\1/p' peers/mgmtctl/main.cpp)
+check_words() { # DOCUMENT
+    local line word rest
+    while read -r line; do
+        read -r word rest <<<"$line"
+        while [[ $word == --* || $word == \[* ]]; do
+            check_option "$1" mgmtctl "${word//[][]/}"
+            read -r word rest <<<"$rest"
+        done
+        [[ $word =~ ^[a-z]+$ ]] || continue
+        grep -qx "$word" <<<"$commands" || { missing "$1" "mgmtctl has no command $word"; continue; }
+        for word in ${rest//[][|\{\},;.]/ }; do
+            case $word in
+            --*) check_option "$1" mgmtctl "${word%%=*}" ;;
+            [a-z]*) is_text_of "$word" "${ctl_sources[@]}" || missing "$1" "mgmtctl knows no word $word" ;;
+            esac
+        done
+    # Left out: what is drawn, a second command, the operator's own names and files.
+    done < <(quotations "$1" | grep -oP '(^|[#$;&] |sudo )mgmtctl \K[^<>#"()]+' |
+        sed -E 's/---.*//; s/[;&|] *[a-z].*//; s/\b(interface|name|password) [a-z][a-z0-9.]*/\1/g; s/ [^ ]+\.(conf|json)\b//g; s/:.*//' | sort -u)
+}
+
+check_option() { # DOCUMENT PROGRAM OPTION
+    local sources
+    case $2 in
+    mgmtctl) sources=("${ctl_sources[@]}") ;;
+    mgmtd | tunneld) sources=("peers/$2/main.cpp") ;;
+    *) sources=("scripts/$2") ;;
+    esac
+    [ "$3" = -- ] || grep -qE -e "(\"|^ *|[[ ])${3%%[.,]*}\b" "${sources[@]}" || missing "$1" "$2 has no option $3"
+}
+check_options() { # DOCUMENT
+    local program option
+    while read -r program option; do
+        check_option "$1" "$program" "$option"
+    done < <(quotations "$1" | sed 's/"[a-z]* /"/g' | grep -E '^(mgmtd|tunneld|(sudo )?scripts/[a-z-]+\.sh)\b' |
+        awk '{ sub(/^(sudo )?(scripts\/)?/, ""); for (i = 2; i <= NF && $i !~ /^[#"]/; i++)
+            if (match($i, /--[a-z][a-z-]*/)) print $1, substr($i, RSTART, RLENGTH) }' | sort -u)
+}
+
+for document in "${documents[@]}"; do
+    check_files "$document"
+    check_words "$document"
+    check_options "$document"
+done
+for step in $(sed -n 's/^#.*only these steps, of: //p' scripts/test.sh); do
+    grep -q "\`$step\`" CONTRIBUTING.md || missing CONTRIBUTING.md "scripts/test.sh has a step $step"
+done
+[ $status = 0 ] || echo "check-docs.sh: what is quoted there does not exist" >&2
+exit $status
