@@ -2,7 +2,8 @@
 # check-docs.sh: what the documents quote exists. Quoted is what is in backticks or in an indented block, and the
 # target of a link.
 #   Files     a path that begins with a directory of the tree, and a bare name of a source file or script
-#   mgmtctl   the command is one of peers/mgmtctl/main.cpp; further words and options are texts of its sources
+#   mgmtctl   the command is one of peers/mgmtctl/main.cpp; further words and options are texts of its sources.
+#             docs/mgmtctl.md has each command
 #   Options   of mgmtd, tunneld and the scripts: words of their sources
 #   Steps     of scripts/test.sh: CONTRIBUTING.md has each
 set -eu
@@ -85,6 +86,9 @@ for document in "${documents[@]}"; do
     check_files "$document"
     check_words "$document"
     check_options "$document"
+done
+for command in $commands; do
+    grep -qE "^\| [^|]*\`${command}[\` ]" docs/mgmtctl.md || missing docs/mgmtctl.md "mgmtctl has a command $command"
 done
 for step in $(sed -n 's/^#.*only these steps, of: //p' scripts/test.sh); do
     grep -q "\`$step\`" CONTRIBUTING.md || missing CONTRIBUTING.md "scripts/test.sh has a step $step"
