@@ -60,7 +60,7 @@ check_words() { # DOCUMENT
             esac
         done
     # Left out: what is drawn, a second command, the operator's own names and files.
-    done < <(quotations "$1" | grep -oP '(^|[#$;&] |sudo )mgmtctl \K[^<>#"()]+' |
+    done < <(quotations "$1" | grep -oP '(^ *|[#$;&] |sudo )mgmtctl \K[^<>#"()]+' |
         sed -E 's/---.*//; s/[;&|] *[a-z].*//; s/\b(interface|name|password) [a-z][a-z0-9.]*/\1/g; s/ [^ ]+\.(conf|json)\b//g; s/:.*//' | sort -u)
 }
 
