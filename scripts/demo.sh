@@ -5,7 +5,7 @@
 # that the client fetches come through the proxies in these shares, while the downloads go on. Then the proxy of one is
 # killed, and starts again; then the whole appliance dies. The fetches go on. On a terminal `mgmtctl show --watch` of the
 # appliance that survives stays on the screen, below what is awaited, for how long, and by whom the last pages came;
-# without one there is a line for each step. Takes some 70 seconds, installs and builds what is missing, leaves nothing
+# without one there is a line for each step. Takes some 75 seconds, installs and builds what is missing, leaves nothing
 # running.
 #   --capture FILE   keep the packets of the protocol and of redirected flows, for tshark or wireshark
 #   --plain          lines, on a terminal as well
@@ -138,12 +138,12 @@ browse() {
     fetch_pages 120 1
     say "  c1: $pages"
 }
-# They last while a1 joins: some twenty protocol seconds longer than that takes.
+# They last while a1 joins, and some ten seconds of the protocol longer.
 downloads=16
 begin_downloads() {
     local rate=100000
     nsenter -t "${LAB_INIT[c1]}" --net "$WCCP_BIN/wccp_router" fetch --from 10.1.0.128 10.2.0.2 --sources $downloads \
-        --count $downloads --parallel $downloads --rate $rate --size "$((rate * 1000 * 48 / speed_milli + rate * 3))" \
+        --count $downloads --parallel $downloads --rate $rate --size "$((rate * 1000 * 36 / speed_milli + rate * 3))" \
         </dev/null >"$LAB/downloads" 2>>"$LAB/c1.out" &
     LAB_PID[c1/downloads]=$!
     say "  c1: $downloads downloads begin, $((rate / 1000)) kB/s each"

@@ -91,7 +91,10 @@ event_proxy_killed() {
 }
 event_drain_stop() {
     kill -USR1 $client # connections end one after the other, and the new ones do not last
-    lab_in a3 "$WCCP_BIN/mgmtctl" drain 51 for 120 wait || die "the drain ended with $?"
+    # Broken connections stay open at the proxy, which nobody tells: without protection the drain waits in vain.
+    local for=120
+    [ "${LAB_PROTECTION-}" != 0 ] || for=30
+    lab_in a3 "$WCCP_BIN/mgmtctl" drain 51 for $for wait || [ $for = 30 ] || die "the drain ended with $?"
     lab_stop a3 mgmtd || die "mgmtd of a3 ended with $?"
     router_is r1 30 51 '$g.appliances | length == 2'
 }
