@@ -63,12 +63,14 @@ static bool take_line(const char *line, platform_limits *limits) {
     return false;
 }
 
-platform_limits platform_limits_read(const char *path) {
+platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
     const cancel_off_guard whole; // the file is closed at the end, cancelled or not
     platform_limits limits = defaults;
+    if (out_bad_line)
+        *out_bad_line = 0;
     FILE *file = fopen(path, "re");
     if (!file) {
-        if (errno != ENOENT)
+        if (errno != ENOENT && !out_bad_line)
             QV_LOG(LC_LOG_WARNING, "%s: cannot be read (%m), defaults taken", path);
         return limits;
     }
@@ -86,7 +88,11 @@ platform_limits platform_limits_read(const char *path) {
         more = c != EOF;
         line[length] = '\0';
         line[strcspn(line, "\r")] = '\0';
-        if ((!good && *skip_blanks(line) != '#') || !take_line(line, &limits))
+        if ((good || *skip_blanks(line) == '#') && take_line(line, &limits))
+            continue;
+        if (out_bad_line)
+            *out_bad_line = *out_bad_line ? *out_bad_line : number;
+        else
             QV_LOG(LC_LOG_WARNING, "%s: bad line %u passed over: %s", path, number, line);
     }
     fclose(file);

@@ -15,4 +15,5 @@ struct platform_limits {
     uint32_t max_user_tunnels;
     uint32_t max_interfaces;
 };
-platform_limits platform_limits_read(const char *path);
+// With `out_bad_line` nothing is logged: it gets the number of the first bad line, or 0.
+platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line = nullptr);

@@ -143,23 +143,20 @@ static uint64_t parse_hex(const char *word, uint64_t limit) {
     return errno == 0 && *end == '\0' && word[0] != '-' && number <= limit ? number : 0;
 }
 
-// False for a line that is passed over.
-static bool parse_conf_line(char *line, cmem_conf *out) {
-    char whole[CONF_LINE_BYTES];
-    strlcpy(whole, line, sizeof whole);
+// False for a line that is passed over; `out_wrong` is what is wrong with it, or null for a comment.
+static bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) {
+    *out_wrong = nullptr;
     const char *name = next_word(&line);
     if (name[0] == '#' || name[0] == '\0')
         return false;
     *out = {};
     memcpy(out->name, name, strnlen(name, NAME_BYTES - 1));
-    if (!parse_node(next_word(&line), &out->node)) {
-        QV_LOG(LC_LOG_ERR, "%s: error parsing affinity at line %s\n", "cmem_load_conf", whole);
+    if (!parse_node(next_word(&line), &out->node))
+        *out_wrong = "affinity";
+    else if (!parse_page_size(next_word(&line), &out->page_size))
+        *out_wrong = "page size";
+    if (*out_wrong)
         return false;
-    }
-    if (!parse_page_size(next_word(&line), &out->page_size)) {
-        QV_LOG(LC_LOG_ERR, "%s: error parsing page size at line %s\n", "cmem_load_conf", whole);
-        return false;
-    }
     out->key = static_cast<uint32_t>(parse_hex(next_word(&line), UINT32_MAX));
     if (out->key == static_cast<uint32_t>(CMEM_REGISTRY_KEY))
         out->key = 0; // a block there would wipe out the registry
@@ -167,30 +164,75 @@ static bool parse_conf_line(char *line, cmem_conf *out) {
     return true;
 }
 
-// Fills the entries of a registry that this process is loading. False, with a line, when the file cannot be
-// read; the entries are then empty.
-static bool load_conf(cmem_registry *fresh) {
-    FILE *file = fopen(CMEM_CONF_PATH, "re");
-    char line[CONF_LINE_BYTES];
+// Calls take(entry) for each good line until it gives false, and fail(what is wrong, line, its number) for
+// the others. 0, or the errno of a file that cannot be read.
+template <typename Take, typename Fail>
+static int read_conf(const char *path, const Take &take, const Fail &fail) {
+    FILE *file = fopen(path, "re");
+    char line[CONF_LINE_BYTES], whole[CONF_LINE_BYTES];
     cmem_conf entry;
     bool inside = false; // of a line longer than the buffer: the rest of it is passed over
-    for (uint32_t count = 0; file && count < MAX_CONF && fgets(line, sizeof line, file);) {
+    bool more = true;
+    for (uint32_t number = 0; file && more && fgets(line, sizeof line, file);) {
         const bool rest = inside;
         char *end = strpbrk(line, "\r\n");
         inside = !end && strlen(line) == sizeof line - 1;
         if (end)
             *end = '\0';
-        if (!rest && parse_conf_line(line, &entry))
-            fresh->conf[count++] = entry;
+        if (rest)
+            continue;
+        number++;
+        strlcpy(whole, line, sizeof whole);
+        const char *wrong = nullptr;
+        if (parse_conf_line(line, &entry, &wrong))
+            more = take(entry);
+        else if (wrong)
+            fail(wrong, whole, number);
     }
-    const bool failed = !file || ferror(file);
-    if (failed) {
-        QV_LOG(LC_LOG_ERR, "%s: cannot read %s, err=%s\n", "cmem_load_conf", CMEM_CONF_PATH, strerror(errno));
-        memset(static_cast<void *>(fresh->conf), 0, sizeof fresh->conf);
-    }
+    const int error = !file || ferror(file) ? errno : 0;
     if (file)
         fclose(file);
-    return !failed;
+    return error;
+}
+
+// Fills the entries of a registry that this process is loading. False, with a line, when the file cannot be
+// read; the entries are then empty.
+static bool load_conf(cmem_registry *fresh) {
+    uint32_t count = 0;
+    const int error = read_conf(
+        CMEM_CONF_PATH,
+        [&](const cmem_conf &entry) {
+            fresh->conf[count++] = entry;
+            return count < MAX_CONF;
+        },
+        [](const char *wrong, const char *line, uint32_t) {
+            QV_LOG(LC_LOG_ERR, "%s: error parsing %s at line %s\n", "cmem_load_conf", wrong, line);
+        });
+    if (error) {
+        QV_LOG(LC_LOG_ERR, "%s: cannot read %s, err=%s\n", "cmem_load_conf", CMEM_CONF_PATH, strerror(error));
+        memset(static_cast<void *>(fresh->conf), 0, sizeof fresh->conf);
+    }
+    return error == 0;
+}
+
+cmem_conf_faults cmem_check_conf(const char *path, const char *name) {
+    cmem_conf_faults faults = {};
+    bool found = false; // the first entry of a name counts
+    uint32_t count = 0;
+    faults.error = read_conf(
+        path,
+        [&](const cmem_conf &entry) {
+            if (!found && strcmp(entry.name, name) == 0) {
+                found = true;
+                faults.has_key = entry.key != 0;
+            }
+            return ++count < MAX_CONF;
+        },
+        [&](const char *, const char *, uint32_t number) {
+            if (faults.bad_line == 0)
+                faults.bad_line = number;
+        });
+    return faults;
 }
 
 // --- The registry

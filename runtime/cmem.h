@@ -9,6 +9,14 @@
 constexpr int32_t CMEM_REGISTRY_KEY = static_cast<int32_t>(0xBEEFFEED);
 constexpr const char *CMEM_CONF_PATH = "/etc/opt/rvl/mem.conf";
 
+// What is wrong with a file of that kind; nothing is logged, and no memory attached. Lines are counted from 1.
+struct cmem_conf_faults {
+    int error;         // errno of reading it, or 0
+    uint32_t bad_line; // the first one that is passed over, or 0
+    bool has_key;      // for the block `name`, without which it cannot be created
+};
+cmem_conf_faults cmem_check_conf(const char *path, const char *name);
+
 // Attaches the registry, and loads "mem.conf" into it when no other process has. The other operations do this
 // when they need it. False, with an error line, when another process has been loading for 5 seconds; a
 // registry that cannot be attached ends the process.

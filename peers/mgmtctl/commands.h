@@ -82,5 +82,7 @@ int ctl_show(const ctl_options &options);
 // does, 2: there is no such group, or no answer.
 int ctl_explain(const ctl_options &options, int group);
 int ctl_list_reasons(const ctl_options &options); // all that there can be
+// What bites on this host, with or without mgmtd (check.cpp). 0: nothing to fix, 1: something.
+int ctl_check(const ctl_options &options);
 // Events as they come (watch.cpp). `count` 0: until a signal ends the program.
 int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count);

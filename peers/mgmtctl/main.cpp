@@ -261,6 +261,11 @@ static void add_explain_command(command_line *line) {
     command->add_flag("--list", line->list, "every reason that there can be, as a table");
 }
 
+static void add_check_command(command_line *line) {
+    add_command(line, "check", "what on this host is in the way, and how to fix it",
+                [line] { return ctl_check(line->options); });
+}
+
 static void add_metrics_command(command_line *line) {
     CLI::App *command = add_command(line, "metrics", "counters and states for a monitoring system",
                                     [line] { return ctl_metrics(line->options, line->text, line->http); });
@@ -292,6 +297,7 @@ int main(int argc, char **argv) {
     add_drain_command(&line);
     add_show_command(&line);
     add_explain_command(&line);
+    add_check_command(&line);
     add_metrics_command(&line);
     add_shell_command(&line);
 

@@ -183,6 +183,17 @@ static std::string filled(std::string text, const reason &from) {
     return text;
 }
 
+void fill_reason(const std::vector<reason_text> &texts, reason *inout) {
+    const auto found = std::find_if(texts.begin(), texts.end(),
+                                    [&](const reason_text &row) { return inout->code == row.code; });
+    const reason_text *text = found != texts.end() ? &*found : find_reason_text(inout->code);
+    if (inout->cause.empty())
+        inout->cause = text ? filled(text->cause, *inout)
+                            : inout->code + (inout->who.empty() ? "" : " of " + inout->who);
+    inout->next = filled(text ? text->next : "look at the log of wccpd and tunneld", *inout);
+    inout->attention = !text || text->attention;
+}
+
 // --- Of the state
 
 namespace {
@@ -347,13 +358,7 @@ std::vector<reason> reasons_of(const snapshot &shown) {
         traffic_of(shown, &list);
     }
     for (reason &each : list.reasons) {
-        const reason_text *text = find_reason_text(each.code);
-        if (text && each.cause.empty())
-            each.cause = filled(text->cause, each);
-        else if (each.cause.empty())
-            each.cause = each.code + (each.who.empty() ? "" : " of " + each.who);
-        each.next = filled(text ? text->next : "look at the log of wccpd and tunneld", each);
-        each.attention = !text || text->attention;
+        fill_reason(reason_texts(), &each);
     }
     std::stable_sort(list.reasons.begin(), list.reasons.end(), [](const reason &a, const reason &b) {
         return a.group != b.group ? a.group < b.group : place_of(a.code) < place_of(b.code);

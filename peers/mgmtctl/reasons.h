@@ -28,6 +28,8 @@ struct reason {
     bool attention = true;
     std::string cause, next; // filled in
 };
+// Fills in the words of its code, from `texts` or else from the table above.
+void fill_reason(const std::vector<reason_text> &texts, reason *inout);
 // In the order of their groups, those of the whole appliance first, and of the table.
 std::vector<reason> reasons_of(const snapshot &shown);
 // The one to begin with; null when nothing of the group needs attention.

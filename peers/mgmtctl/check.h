@@ -1,0 +1,75 @@
+// What bites on Linux, and how to mend it: facts about the host are gathered first, then judged. Nothing is
+// changed, and no program is needed: what could not be looked at is said.
+#pragma once
+
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include <nlohmann/json_fwd.hpp>
+
+#include "peers/mgmtctl/link.h"
+#include "peers/mgmtctl/reasons.h"
+
+struct check_group {
+    int id = 0;
+    std::string interface; // empty: none is set
+    bool up = true;        // administratively
+    std::string encap;     // "gre", "l2", "either"
+};
+struct check_interface {
+    bool up = false; // and has its carrier
+    std::vector<std::string> addresses;
+    long mtu = 0;
+    std::optional<long> rp_filter, forwarding; // its own; empty: cannot be read
+};
+// Who has UDP port 2048. Both are empty, and 0, where only root may know.
+struct check_socket {
+    std::string address; // 0.0.0.0 also for one of IPv6
+    std::string program;
+    int process = 0;
+};
+enum class check_feature { missing, present, unknown };
+// A file of the host's configuration.
+struct check_file {
+    int error = 0;         // errno of reading it
+    uint32_t bad_line = 0; // the first one; 0: none
+    bool complete = true;  // has what wccpd needs of it
+};
+struct check_facts {
+    std::string mgmtd_error; // why the groups are not known; empty: they are
+    std::vector<check_group> groups;
+    std::map<std::string, check_interface> interfaces; // all that there are
+    std::optional<long> all_rp_filter;
+    std::string ports_error;
+    std::vector<check_socket> sockets;
+    std::string filter_error, legacy_tables; // the tables that iptables has of its own
+    std::string legacy_error;
+    std::string filter_listing; // of nftables, as JSON
+    check_feature gre = check_feature::unknown, tun = check_feature::unknown, tproxy = check_feature::unknown;
+    std::optional<bool> clock_synchronised;
+    bool wccpd_runs = false;
+    std::string lock_limit_error;             // why the next two are unknown
+    std::optional<uint64_t> lock_limit_bytes; // of wccpd; empty: none
+    bool may_lock = false;                    // CAP_IPC_LOCK
+    check_file mem_conf, platform_conf;
+    bool root = true; // who looks
+};
+
+struct check_result {
+    std::vector<reason> findings; // in the order of the checks
+    struct unchecked {
+        std::string check, why;
+    };
+    std::vector<unchecked> unchecked;
+    std::vector<std::string> fine; // checks with neither
+};
+check_result judge_facts(const check_facts &facts);
+// The words of findings; those of a code that wccpd has as well are in the table of reasons.h.
+const std::vector<reason_text> &check_texts();
+
+// Looks at the host (check_facts.cpp), and asks for the groups.
+check_facts gather_facts(const ctl_link &link);
+// 0: nothing to fix, 1: something.
+int tell_checks(const ctl_options &options, const check_result &result);
