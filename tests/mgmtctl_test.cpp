@@ -1,12 +1,22 @@
 // mgmtctl without mgmtd: what it shows, what it says of changes and of names that don't exist, and its
 // session with a provider made by hand.
+#include <arpa/inet.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <iterator>
 #include <thread>
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
 #include "mgmt/node_paths.h"
+#include "peers/mgmtctl/check.h"
 #include "peers/mgmtctl/config_change.h"
 #include "peers/mgmtctl/metrics.h"
 #include "peers/mgmtctl/nodes.h"
@@ -482,4 +492,189 @@ TEST(Session, ARequestGetsItsOwnAnswerAndEventsWaitForTheirTurn) {
     EXPECT_EQ(ctl_open(3000, &reason), nullptr);
     EXPECT_EQ(reason, "mgmtd refuses its service to us");
     refusing.join();
+}
+
+// --- What is wrong with the host
+
+static check_facts sound_host() {
+    check_facts host;
+    host.groups = {{51, "eth0", true, "either"}, {52, "eth0", true, "l2"}, {53, "eth7", false, "gre"}};
+    host.interfaces = {{"eth0", {true, {"10.0.0.101"}, 1500, 0, 1}}, {"wccp0", {true, {}, 1500, 0, 1}}};
+    host.all_rp_filter = 0;
+    host.sockets = {{"10.0.0.101", "wccpd", 7}, {"127.0.0.1", "dns", 8}};
+    host.filter_listing = R"({"nftables":[]})";
+    host.gre = host.tun = host.tproxy = check_feature::present;
+    host.clock_synchronised = host.wccpd_runs = host.may_lock = true;
+    return host;
+}
+
+// The codes of what was found, then what was not checked.
+static std::string judged(const check_facts &host) {
+    std::string text;
+    const check_result result = judge_facts(host);
+    for (const reason &each : result.findings) {
+        text += each.code + (each.group < 0 ? " " : "@" + std::to_string(each.group) + " ");
+        EXPECT_EQ((each.cause + each.next).find('{'), std::string::npos) << each.cause << each.next;
+    }
+    for (const auto &each : result.unchecked)
+        text += "-" + each.check + " ";
+    return text;
+}
+
+TEST(Check, EachFactIsJudged) {
+    const struct {
+        void (*change)(check_facts *host);
+        const char *found;
+    } rows[] = {
+        {[](check_facts *) {}, ""},
+        {[](check_facts *host) {
+             host->sockets.push_back({"0.0.0.0", "nfsd", 9});
+         },
+         "port-taken "},
+        {[](check_facts *host) { host->sockets[1].address = "10.0.0.101"; }, "port-taken "},
+        {[](check_facts *host) { host->sockets[0].program = ""; }, "-UDP port 2048 "},
+        {[](check_facts *host) { host->sockets[0].program = "", host->wccpd_runs = false; },
+         "port-taken -locked memory "},
+        {[](check_facts *host) { host->groups[2].up = true; }, "interface-missing@53 "},
+        {[](check_facts *host) { host->groups[0].interface = host->groups[1].interface = ""; },
+         "no-interface@51 no-interface@52 "},
+        {[](check_facts *host) { host->interfaces["eth0"].up = false; }, "interface-down@51 "},
+        {[](check_facts *host) { host->interfaces["eth0"].addresses.clear(); }, "interface-no-address@51 "},
+        {[](check_facts *host) { host->all_rp_filter = 1; }, "rp-filter rp-filter@52 "},
+        {[](check_facts *host) { host->interfaces["eth0"].rp_filter = 1; }, "rp-filter@52 "},
+        {[](check_facts *host) { host->all_rp_filter = 2, host->interfaces["wccp0"].rp_filter = 1; }, ""},
+        {[](check_facts *host) { host->interfaces["wccp0"].forwarding = 0; }, "forwarding-off "},
+        {[](check_facts *host) { host->interfaces["eth0"].mtu = 1499; }, "mtu-small@51 "},
+        {[](check_facts *host) { host->gre = check_feature::missing; }, "gre-by-tun "},
+        {[](check_facts *host) { host->gre = host->tun = check_feature::missing; }, "gre-missing "},
+        {[](check_facts *host) { host->tproxy = check_feature::missing, host->tun = check_feature::unknown; },
+         "tproxy-missing -kernel "},
+        {[](check_facts *host) { host->clock_synchronised = false; }, "clock-unsynchronised "},
+        {[](check_facts *host) { host->may_lock = false; }, ""}, // there is no limit
+        {[](check_facts *host) { host->may_lock = false, host->lock_limit_bytes = 65536; }, "memory-lock "},
+        {[](check_facts *host) {
+             host->mem_conf = {ENOENT, 0, false};
+         },
+         "mem-conf-unreadable "},
+        {[](check_facts *host) {
+             host->mem_conf = {0, 3, false};
+         },
+         "mem-conf-line mem-conf-mailbox "},
+        {[](check_facts *host) { host->mem_conf.error = EACCES, host->root = false; }, "-mem.conf "},
+        {[](check_facts *host) { host->platform_conf.error = ENOENT; }, ""},
+        {[](check_facts *host) { host->platform_conf.bad_line = 1; }, "platform-conf-line "},
+        {[](check_facts *host) { host->filter_error = "no", host->legacy_tables = "filter"; },
+         "-firewall -firewall "},
+        {[](check_facts *host) { host->mgmtd_error = "gone", host->groups.clear(), host->all_rp_filter = 1; },
+         "rp-filter -interfaces -rp_filter -forwarding -MTU "},
+    };
+    for (const auto &row : rows) {
+        check_facts host = sound_host();
+        row.change(&host);
+        if (!host.mgmtd_error.empty())
+            host.sockets.clear();
+        EXPECT_EQ(judged(host), row.found) << &row - rows;
+    }
+    std::ifstream in(WCCP_SOURCE_DIR "/docs/operations.md");
+    const std::string documents{std::istreambuf_iterator<char>(in), {}};
+    for (const reason_text &text : check_texts())
+        EXPECT_NE(documents.find(std::string("| `") + text.code + "` "), std::string::npos) << text.code;
+}
+
+// A table "f" with a chain at a hook, of these rules.
+static std::string listing(const std::string &head, const std::vector<std::string> &rules) {
+    const std::string above = R"("family":"inet","table":"f",)";
+    std::string text = R"({"nftables":[{"set":{)" + above + R"("name":"ports","elem":[53,2048]}},)" +
+                       R"({"chain":{)" + above + R"("name":"refuse"}},{"chain":{)" + above +
+                       R"("name":"c","type":"filter",)" + head + "}}";
+    for (const std::string &rule : rules)
+        text += R"(,{"rule":{)" + above + R"("chain":"c","expr":[)" + rule + "]}}";
+    return text + R"(,{"rule":{)" + above + R"("chain":"refuse","expr":[{"reject":null}]}}]})";
+}
+
+TEST(Check, RulesThatDropTheProtocolAreFound) {
+    const auto match = [](const char *left, const char *right, const char *op = "==") {
+        return std::string(R"({"match":{"op":")") + op + R"(","left":{)" + left + R"(},"right":)" + right +
+               "}},";
+    };
+    const char *const port = R"("payload":{"protocol":"udp","field":"dport"})";
+    const char *const protocol = R"("meta":{"key":"l4proto"})";
+    const char *const from = R"("payload":{"protocol":"ip","field":"saddr"})";
+    const std::string closed = R"("hook":"input","policy":"drop")", accept = R"({"accept":null})",
+                      drop = R"({"counter":{}},{"drop":null})",
+                      replies =
+                          match(R"("ct":{"key":"state"})", R"(["established","related"])", "in") + accept;
+    const struct {
+        std::string head;
+        std::vector<std::string> rules;
+        const char *found;
+    } rows[] = {
+        {R"("hook":"input")", {}, ""},
+        {closed, {replies}, "firewall-drops-wccp@51 firewall-drops-gre@51 "},
+        {R"("hook":"forward","policy":"drop")", {}, ""},
+        {R"("hook":"output","policy":"drop")",
+         {match(R"("meta":{"key":"oifname"})", R"("eth*")") + accept},
+         ""},
+        {closed, {match(port, "2048") + accept}, "firewall-drops-gre@51 "},
+        {closed, {match(port, R"("@ports")") + accept, match(protocol, "47") + accept}, ""},
+        {closed, {match(protocol, R"({"set":["gre","esp"]})") + accept}, "firewall-drops-wccp@51 "},
+        {closed,
+         {match(port, R"({"set":[53,{"range":[2000,2047]}]})") + accept, match(protocol, "47") + accept},
+         "firewall-drops-wccp@51 "},
+        {closed, {match(port, "53", "!=") + accept, match(protocol, "47") + accept}, ""},
+        {closed,
+         {match(R"("meta":{"key":"iifname"})", R"("lo")") + accept, match(from, R"("10.0.0.1")") + accept},
+         "firewall-unclear@51 firewall-unclear@51 "},
+        {R"("hook":"input")",
+         {match(protocol, "47") + R"({"jump":{"target":"refuse"}})"},
+         "firewall-drops-gre@51 "},
+        {R"("hook":"input")",
+         {R"({"limit":{"rate":10}},)" + match(port, "2048") + drop},
+         "firewall-unclear@51 "},
+        {R"("hook":"prerouting")",
+         {R"({"vmap":{"key":{"meta":{"key":"l4proto"}},"data":{"set":[["udp",{"drop":null}]]}}})"},
+         "firewall-drops-wccp@51 "},
+        // After what may be dropped, what is dropped; after what may pass, nothing is certain.
+        {closed,
+         {match(from, R"("10.0.0.9")") + drop, match(protocol, "47") + accept},
+         "firewall-drops-wccp@51 firewall-unclear@51 "},
+    };
+    for (const auto &row : rows) {
+        check_facts host = sound_host();
+        host.filter_listing = listing(row.head, row.rules);
+        EXPECT_EQ(judged(host), row.found) << host.filter_listing;
+    }
+}
+
+TEST(Check, ThisHostIsLookedAt) {
+    std::filesystem::create_directories("/etc/opt/rvl");
+    std::ofstream("/etc/opt/rvl/mem.conf") << "# x\nwccpd_mailbox local normal\nother here\n";
+    std::ofstream("/etc/opt/rvl/platform.conf") << "max_interfaces 7\nmax_interfaces 0\nmax_x 1\n";
+    const int fd = socket(AF_INET6, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    sockaddr_in6 local = {};
+    local.sin6_family = AF_INET6;
+    local.sin6_port = htons(2048);
+    ASSERT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&local), sizeof local), 0);
+    ctl_link link;
+    link.query = [](ctl_walk, const std::string &name, ctl_reply *out, std::string *) {
+        if (name == GROUPS)
+            out->bindings = {{G51, "uint8", "51"}};
+        else
+            out->bindings = {{G51, "uint8", "51"}, {G51 + "/interface", "string", "lo"}};
+        return true;
+    };
+    const check_facts host = gather_facts(link);
+    close(fd);
+    ASSERT_EQ(host.groups.size(), 1u) << host.mgmtd_error;
+    EXPECT_TRUE(host.groups[0].interface == "lo" && host.groups[0].up && host.groups[0].encap == "either");
+    ASSERT_EQ(host.interfaces.count("lo"), 1u);
+    const check_interface &loopback = host.interfaces.at("lo");
+    EXPECT_TRUE(loopback.up && loopback.addresses == std::vector<std::string>{"127.0.0.1"} &&
+                loopback.mtu == 65536 && loopback.forwarding && loopback.rp_filter);
+    ASSERT_EQ(host.sockets.size(), 1u);
+    EXPECT_TRUE(host.sockets[0].address == "0.0.0.0" && host.sockets[0].process == getpid());
+    EXPECT_TRUE(host.mem_conf.error == 0 && host.mem_conf.bad_line == 3 && !host.mem_conf.complete);
+    EXPECT_TRUE(host.platform_conf.error == 0 && host.platform_conf.bad_line == 2);
+    EXPECT_TRUE(!host.wccpd_runs && host.clock_synchronised);
+    EXPECT_EQ(host.filter_listing.empty(), !host.filter_error.empty());
 }

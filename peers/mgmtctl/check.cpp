@@ -75,7 +75,7 @@ struct judging {
         one.wanted = wanted;
         fill_reason(check_texts(), &one);
         const auto same = [&](const reason &other) {
-            return other.code == one.code && other.cause == one.cause;
+            return other.cause == one.cause && other.next == one.next;
         };
         if (std::none_of(result.findings.begin(), result.findings.end(), same))
             result.findings.push_back(std::move(one));
@@ -339,8 +339,11 @@ int tell_checks(const ctl_options &options, const check_result &result) {
     for (const reason &each : result.findings)
         put(each.code + (each.group < 0 ? "" : " (group " + std::to_string(each.group) + ")") + ": " +
             each.cause + "\n    " + (each.attention ? "fix: " : "no fault; ") + each.next + "\n");
+    std::map<std::string, std::string> unchecked; // the checks, by why
     for (const auto &each : result.unchecked)
-        put("not checked: " + each.check + ": " + each.why + "\n");
+        unchecked[each.why] += (unchecked[each.why].empty() ? "" : ", ") + each.check;
+    for (const auto &[why, names] : unchecked)
+        put("not checked: " + names + ": " + why + "\n");
     std::string fine;
     for (const std::string &each : result.fine)
         fine += (fine.empty() ? "fine: " : ", ") + each;

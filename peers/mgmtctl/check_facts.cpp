@@ -23,6 +23,7 @@
 #include "peers/mgmtctl/check.h"
 #include "peers/mgmtctl/groups.h"
 #include "platform/limits.h"
+#include "runtime/capabilities.h"
 #include "runtime/cmem.h"
 
 namespace {
@@ -202,8 +203,11 @@ void gather_wccpd(check_facts *out) {
 // --- The packet filter
 
 void gather_filter(check_facts *out) {
-    nft_ctx *context = nft_ctx_new(NFT_CTX_DEFAULT);
-    if (!context || nft_ctx_buffer_output(context) != 0 || nft_ctx_buffer_error(context) != 0)
+    const bool may = lc_has_capability(CAP_NET_ADMIN); // without it the library complains on standard error
+    nft_ctx *context = may ? nft_ctx_new(NFT_CTX_DEFAULT) : nullptr;
+    if (!may)
+        out->filter_error = "it takes root, or CAP_NET_ADMIN";
+    else if (!context || nft_ctx_buffer_output(context) != 0 || nft_ctx_buffer_error(context) != 0)
         out->filter_error = "out of memory";
     else {
         nft_ctx_output_set_flags(context, NFT_CTX_OUTPUT_JSON | NFT_CTX_OUTPUT_NUMERIC_PROTO);
