@@ -544,6 +544,7 @@ TEST(Check, EachFactIsJudged) {
         {[](check_facts *host) { host->interfaces["eth0"].rp_filter = 1; }, "rp-filter@52 "},
         {[](check_facts *host) { host->all_rp_filter = 2, host->interfaces["wccp0"].rp_filter = 1; }, ""},
         {[](check_facts *host) { host->interfaces["wccp0"].forwarding = 0; }, "forwarding-off "},
+        {[](check_facts *host) { host->interfaces["eth0"].forwarding = 0; }, "forwarding-later@52 "},
         {[](check_facts *host) { host->interfaces["eth0"].mtu = 1499; }, "mtu-small@51 "},
         {[](check_facts *host) { host->gre = check_feature::missing; }, "gre-by-tun "},
         {[](check_facts *host) { host->gre = host->tun = check_feature::missing; }, "gre-missing "},

@@ -20,6 +20,8 @@ const std::vector<reason_text> &check_texts() {
          "sysctl -w net/ipv4/conf/{who}/rp_filter=2"},
         {"forwarding-off", true, "{who} does not forward: packets that are given back are lost",
          "sysctl -w net/ipv4/conf/{who}/forwarding=1"},
+        {"forwarding-later", false, "{who} does not forward; tunneld sees to it once a router sends by L2",
+         "nothing; when the group is ACTIVE and still lacks it, look at tunneld's log"},
         {"firewall-drops-wccp", true, "UDP port 2048 {offered} {who} is dropped in {wanted}",
          "nft insert rule {wanted} udp dport 2048 accept"},
         {"firewall-drops-gre", true, "protocol 47 (GRE) {offered} {who} is dropped in {wanted}",
@@ -180,7 +182,7 @@ void judge_forwarding(judging *work) {
         if (!interface.forwarding)
             work->skip("the setting of " + name + " cannot be read");
         else if (*interface.forwarding == 0)
-            work->find("forwarding-off", group, name);
+            work->find(group < 0 ? "forwarding-off" : "forwarding-later", group, name);
     });
 }
 
@@ -338,7 +340,7 @@ int tell_checks(const ctl_options &options, const check_result &result) {
     }
     for (const reason &each : result.findings)
         put(each.code + (each.group < 0 ? "" : " (group " + std::to_string(each.group) + ")") + ": " +
-            each.cause + "\n    " + (each.attention ? "fix: " : "no fault; ") + each.next + "\n");
+            each.cause + "\n    " + (each.attention ? "fix: " : "no fault: ") + each.next + "\n");
     std::map<std::string, std::string> unchecked; // the checks, by why
     for (const auto &each : result.unchecked)
         unchecked[each.why] += (unchecked[each.why].empty() ? "" : ", ") + each.check;
