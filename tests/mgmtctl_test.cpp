@@ -635,6 +635,13 @@ TEST(Check, RulesThatDropTheProtocolAreFound) {
         {R"("hook":"prerouting")",
          {R"({"vmap":{"key":{"meta":{"key":"l4proto"}},"data":{"set":[["udp",{"drop":null}]]}}})"},
          "firewall-drops-wccp@51 "},
+        // Of iptables-nft.
+        {R"("hook":"input")",
+         {match(protocol, "17") + R"({"xt":{"type":"target","name":"LOG"}})",
+          match(protocol, "17") + R"({"xt":{"type":"target","name":"REJECT"}})",
+          match(protocol, "6") + R"({"xt":null})"},
+         "firewall-drops-wccp@51 "},
+        {R"("hook":"input")", {match(protocol, "47") + R"({"xt":null})"}, "firewall-unclear@51 "},
         // After what may be dropped, what is dropped; after what may pass, nothing is certain.
         {closed,
          {match(from, R"("10.0.0.9")") + drop, match(protocol, "47") + accept},

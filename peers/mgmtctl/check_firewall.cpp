@@ -50,6 +50,8 @@ struct walker {
     answer holds(const json &left, const json &right) const;
     answer matches(const json &match) const;
     fate apply(const std::string &verdict, const json &body, answer condition, int depth);
+    fate end_unclear(answer condition);
+    fate apply_extension(const json &body, bool last, answer *inout_condition);
     fate walk_rule(const json &rule, int depth);
     fate walk_chain(const std::string &name, int depth);
 };
@@ -174,6 +176,27 @@ fate walker::apply(const std::string &verdict, const json &body, answer conditio
     return verdict == "queue" && condition == answer::yes ? fate::accepted : fate::goes_on;
 }
 
+fate walker::end_unclear(answer condition) {
+    may_accept = may_accept || condition != answer::no;
+    may_drop = may_drop || condition != answer::no;
+    return fate::goes_on;
+}
+
+// Of iptables-nft. Older libraries give no name: what ends a rule then may be a target, and anything else a
+// match.
+fate walker::apply_extension(const json &body, bool last, answer *inout_condition) {
+    const std::string name = text_at(body, "name"), type = text_at(body, "type");
+    for (const char *harmless : {"LOG", "NFLOG", "MARK", "CONNMARK", "CT", "TCPMSS", "CHECKSUM", "CLASSIFY"})
+        if (name == harmless)
+            return fate::goes_on;
+    if (name == "REJECT")
+        return apply("reject", json(), *inout_condition, 0);
+    if (type == "target" || (type.empty() && last))
+        return end_unclear(*inout_condition);
+    *inout_condition = both(*inout_condition, answer::maybe);
+    return fate::goes_on;
+}
+
 fate walker::walk_rule(const json &rule, int depth) {
     answer condition = answer::yes;
     if (!rule.contains("expr") || !rule["expr"].is_array())
@@ -196,7 +219,7 @@ fate walker::walk_rule(const json &rule, int depth) {
         } else if (kind == "vmap" && body.contains("key") && body.contains("data")) {
             const json &data = body["data"];
             if (!data.is_object() || !data.contains("set") || !data["set"].is_array()) {
-                may_accept = may_drop = may_accept || condition != answer::no;
+                (void)end_unclear(condition);
                 continue;
             }
             for (const json &pair : data["set"]) {
@@ -207,8 +230,10 @@ fate walker::walk_rule(const json &rule, int depth) {
                 if (result != fate::goes_on)
                     return result;
             }
-        } else if (kind == "xt" && text_at(body, "type") == "target") {
-            may_accept = may_drop = may_accept || condition != answer::no; // may end the walk, as it likes
+        } else if (kind == "xt") {
+            const fate result = apply_extension(body, &statement == &rule["expr"].back(), &condition);
+            if (result != fate::goes_on)
+                return result;
         } else if (!is_one_of({"counter", "log", "notrack", "mangle", "flow", "ct helper", "comment"}))
             condition = both(condition, answer::maybe); // limits, and what is not understood
     }
