@@ -60,6 +60,10 @@ watch=$!
 watch_one=$!
 lab_wait_role 60 a1 51 ACTIVE || fail "the group does not become active"
 lab_wait 20 '.["51"].router["1"].appliance["10.0.0.101"].load_dist == 100' lab_state a1 || fail "no assignment"
+expect 0 '*wccp_group_active{group="51"} 1*# EOF' metrics
+ctl metrics --http <<<$'HEAD /metrics HTTP/1.1\r\nAccept: text/plain\r\n\r' | grep -q '^Content-Type: text/plain; version=0.0.4' ||
+    fail "no metrics over HTTP"
+ctl metrics --http <<<$'GET / HTTP/1.1\r\n\r' | grep -q '^HTTP/1.1 404' || fail "metrics of something else"
 
 expect 0 100 get $G/weight
 expect 0 "$G/weight = 100"$'\n'"$G/password = [*][*][*][*][*][*][*][*]" get $G/weight $G/password
@@ -170,10 +174,6 @@ if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
     complains 'mgmtctl: user 65534 may look, but not change anything'
     expect 1 '' rollback 2
     as=()
-    expect 0 '*wccp_group_active{group="51"} 1*# EOF' metrics
-    ctl metrics --http <<<$'HEAD /metrics HTTP/1.1\r\nAccept: text/plain\r\n\r' | grep -q '^Content-Type: text/plain; version=0.0.4' ||
-        fail "no metrics over HTTP"
-    ctl metrics --http <<<$'GET / HTTP/1.1\r\n\r' | grep -q '^HTTP/1.1 404' || fail "metrics of something else"
 fi
 
 # The configuration as a whole
