@@ -9,10 +9,10 @@
 // still pending and tunneld may be reading it; it is written last, with release order, and the answer is
 // looked for with acquire order.
 //
-// A command that has been written wakes tunneld by a datagram. The wait is a poll of one millisecond, two thousand times. Between two polls, when there is no answer yet,
-// it is a cancellation point: an answer that has come is taken, and a thread that is cancelled before
-// releases the mutex on its way out and withdraws an add, as after a time-out, since nobody would know the
-// tunnel that came of it.
+// A command that has been written wakes tunneld by a datagram. The wait is a poll of one millisecond, two
+// thousand times. Between two polls, when there is no answer yet, it is a cancellation point: an answer that
+// has come is taken, and a thread that is cancelled before releases the mutex on its way out and withdraws an
+// add, as after a time-out, since nobody would know the tunnel that came of it.
 //
 // Callers wait with the engine lock held, and a tunneld that hangs must not take down groups that need no
 // tunnel. After a time-out, therefore, adds and L2 returns fail at once as if they had timed out, for ten

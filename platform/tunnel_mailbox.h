@@ -70,8 +70,8 @@ bool wccp_attach_mailbox();
 // wccpd's side: takes back an add that it does not wait for any longer. False when tunneld has answered it;
 // the answer is then in the outputs.
 bool wccp_withdraw_command(wccp_tunnel_mailbox *mailbox);
-// wccpd's side: wakes a tunneld that waits for a command, after `command` has been written. Neither blocks nor
-// fails nor is a cancellation point: a tunneld that isn't woken finds the command by polling.
+// wccpd's side: wakes a tunneld that waits for a command, after `command` has been written. Neither blocks
+// nor fails nor is a cancellation point: a tunneld that isn't woken finds the command by polling.
 void wccp_wake_tunneld();
 
 // tunneld's side. Without the block these give the defaults or do nothing.

@@ -9,7 +9,8 @@
 constexpr int32_t CMEM_REGISTRY_KEY = static_cast<int32_t>(0xBEEFFEED);
 constexpr const char *CMEM_CONF_PATH = "/etc/opt/rvl/mem.conf";
 
-// What is wrong with a file of that kind; nothing is logged, and no memory attached. Lines are counted from 1.
+// What is wrong with a file of that kind; nothing is logged, and no memory attached. Lines are counted
+// from 1.
 struct cmem_conf_faults {
     int error;         // errno of reading it, or 0
     uint32_t bad_line; // the first one that is passed over, or 0
