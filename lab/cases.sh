@@ -90,7 +90,9 @@ ready() { # GROUP APPLIANCE...
 # Nodes of tunneld below /qv/tunneld/KIND/state, as nested objects.
 state() { # NODE KIND
     lab_manage "$1" walk "/qv/tunneld/$2/state" 2>/dev/null | jq -c '
-        (arrays // []) | map(.name) as $names | map(select((.name + "/") as $above | all($names[]; startswith($above) | not))) |
+        (arrays // []) |
+        (reduce (.[].name | split("/") | range(1; length) as $depth | .[:$depth] | join("/")) as $above ({}; .[$above] = true)) as $parents |
+        map(select($parents[.name] | not)) |
         reduce .[] as $node ({}; setpath($node.name | split("/")[5:]; $node.value))'
 }
 state_is() { # NODE SECONDS KIND JQ

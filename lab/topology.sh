@@ -533,7 +533,9 @@ lab_manage() { # NODE WORDS...
 # "appliance": {"1": {"ipaddr": ..., "weight": ...}}, ...}}: nodes by the parts of their names.
 lab_state() { # NODE [GROUP]
     lab_manage "$1" walk "/qv/wccpd/wccp/srv_grp/state${2:+/$2}" 2>/dev/null | jq -c --arg group "${2-}" '
-        (arrays // []) | map(.name) as $names | map(select((.name + "/") as $above | all($names[]; startswith($above) | not))) |
+        (arrays // []) |
+        (reduce (.[].name | split("/") | range(1; length) as $depth | .[:$depth] | join("/")) as $above ({}; .[$above] = true)) as $parents |
+        map(select($parents[.name] | not)) |
         reduce .[] as $node ({}; setpath($node.name | split("/")[6:]; $node.value)) |
         if $group == "" then . else .[$group] | objects // {} end'
 }

@@ -545,6 +545,7 @@ struct live_plane : testing::Test {
         EXPECT_TRUE(user_plane.drop_link("wccp0", &error)) << error;
         EXPECT_EQ(if_nametoindex("wccp0"), 0u);
         close(commands[1]);
+        shell("ip link del va"); // it would go with the child's namespace, some time after the child
         kill(child, SIGKILL);
         waitpid(child, nullptr, 0);
     }
