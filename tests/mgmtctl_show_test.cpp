@@ -336,7 +336,8 @@ TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
         EXPECT_EQ(json::parse(draw_json(shown))["groups"][0]["tables"][0]["routers"].size(),
                   misread ? 1u : 2u);
         EXPECT_EQ(explained(shown, -1, &text, true), row.exit);
-        for (const json &each : json::parse(text)["reasons"])
+        const json parsed = json::parse(text);
+        for (const json &each : parsed["reasons"])
             EXPECT_TRUE(each["cause"] != "" && each["next"] != "") << each;
     }
 }
