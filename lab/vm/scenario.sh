@@ -87,7 +87,8 @@ case_life() {
     start --forward gre --return gre
     saved
     lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 interval=1 fall=2 rise=1 leave_after=3)"
-    supervised
+    lab_supervise a1
+    role a1 60 51 ACTIVE
     ready 51 a1
     local form before wccpd
     for form in plain ip redirect; do
@@ -124,7 +125,8 @@ case_life() {
     lab_in a1 pkill -KILL -x mgmtd
     lab_wait_exit 5 a1 mgmtd
     fetches_within 3 '.failed == 0' --count 2
-    supervised
+    lab_supervise a1
+    role a1 60 51 ACTIVE
     ready 51 a1
     fetches "$bypassed" --count 4 --sources 4
     same_in_kernel "$before"
@@ -135,7 +137,8 @@ bypassed='.failed == 0 and .proxies == {"": 2, "a1": 2}'
 case_after_reboot() {
     start --forward gre --return gre
     saved
-    supervised
+    lab_supervise a1
+    role a1 60 51 ACTIVE
     ready 51 a1
     fetches "$bypassed" --count 4 --sources 4
     fetches "$direct" --count 4 --port 8080
