@@ -151,11 +151,11 @@ done
 until_true 20 is_up wccpd || die "wccpd does not follow its mgmtd"
 for unit in "${services[@]}"; do
     mkdir -p $here/root/etc/systemd/system/$unit.service.d
-    printf '[Service]\nWatchdogSec=1\n' >$here/root/etc/systemd/system/$unit.service.d/quick.conf
+    printf '[Service]\nWatchdogSec=3\n' >$here/root/etc/systemd/system/$unit.service.d/quick.conf
 done
 inside systemctl daemon-reload
 inside systemctl restart mgmtd tunneld wccpd
-sleep 3
+sleep 5
 is_up "${services[@]}" && [ "$(inside systemctl show -P NRestarts "${services[@]}" | xargs)" = '0 0 0' ] || die "a watchdog bites by itself"
 for unit in tunneld wccpd mgmtd; do
     old=$(pid $unit)
