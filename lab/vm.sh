@@ -114,10 +114,9 @@ prepare_project() { # ARGUMENTS...
 start_machine() { # kvm|tcg : sets `machine`
     local accel=tcg,thread=multi cpu=max
     [ "$1" = tcg ] || accel=kvm cpu=host
-    : >"$run/console"
     setpriv --pdeathsig KILL bash -c '[ $PPID = "$0" ] && exec "$@"' $$ qemu-system-x86_64 -M q35,hpet=off -accel $accel \
         -cpu $cpu -smp 2 -m 1536 -nodefaults -no-user-config -nic none -display none -monitor none \
-        -serial "file:$run/console" -kernel "$root/vmlinuz" \
+        -no-reboot -chardev "file,id=console,path=$run/console,append=on" -serial chardev:console -kernel "$root/vmlinuz" \
         -append "console=ttyS0 quiet root=/dev/nvme0n1 rw rootwait panic=1 mitigations=off nokaslr tsc=reliable" \
         -device nvme,id=disks,serial=vm \
         -drive "file=$root/root.img,format=raw,if=none,id=root,snapshot=on" -device nvme-ns,drive=root,bus=disks,nsid=1 \
@@ -138,6 +137,7 @@ boot() {
     if [ -z "$VM_ACCEL" ]; then
         VM_ACCEL=tcg
         if [ -w /dev/kvm ]; then
+            : >"$run/console"
             start_machine kvm
             for ((i = 0; i < 60; i++)); do
                 is_up && { VM_ACCEL=kvm; break; }
@@ -149,13 +149,21 @@ boot() {
         [ $VM_ACCEL = tcg ] || return 0
         stop_machine
     fi
+    : >"$run/console"
     start_machine "$VM_ACCEL"
 } 2>/dev/null
+# A machine that restarts ends, and is started anew: the reset of an emulated one does not always come back.
+restart() {
+    [ -z "$restarted" ] && grep -q 'reboot: Restarting system' "$run/console" || return
+    restarted=yes
+    wait "$machine" 2>/dev/null
+    start_machine "$VM_ACCEL"
+}
 # Shows what the cases say as they say it.
 watch() {
-    local seen=0 now began=$SECONDS ended=
+    local seen=0 now began=$SECONDS ended= restarted=
     until [ -n "$ended" ]; do
-        running || ended=yes
+        running || restart || ended=yes
         [ $((SECONDS - began)) -lt "$VM_LIMIT" ] || { echo "vm: after $VM_LIMIT s not yet done" >&2; stop_machine; ended=yes; }
         now=$(wc -l <"$run/console")
         [ "$now" = "$seen" ] || tail -n "+$((seen + 1))" "$run/console" | head -n $((now - seen)) | tr -d '\r' | sed '/^\[ *[0-9.]*\] reboot: /d'
