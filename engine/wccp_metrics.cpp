@@ -33,7 +33,7 @@ int print_reasons(wccp_service_group *group, wccp_piece *piece) {
     uint32_t places;
     const wccp_reason *const table = wccp_reasons_of(group, &places);
     for (uint32_t i = 0; i < places; i++) {
-        if (table[i].code == WCCP_REASON_NONE)
+        if (!wccp_reason_holds(&table[i]))
             continue;
         wccp_piece_add(piece, "reason %s %s %u %u\n", wccp_reason_word(table[i].code),
                        addr_text(table[i].sender).s, table[i].count, wccp_g.seconds - table[i].last);

@@ -179,21 +179,21 @@ int wccp_get_router_appliance_info(wccp_router_appliance_info *info) {
 
 // Reasons and counters.
 
-// False when there is no such group; null, and true, for WCCP_NO_GROUP.
-static bool find_reason_owner(int id, wccp_service_group **out) {
-    *out = id == WCCP_NO_GROUP ? nullptr : wccp_find_group(id);
-    return *out || id == WCCP_NO_GROUP;
+// The reasons of a group, or with WCCP_NO_GROUP those of no group; null when there is no such group. Lock
+// held.
+static const wccp_reason *find_reasons(int id, uint32_t *out_places) {
+    wccp_service_group *group = id == WCCP_NO_GROUP ? nullptr : wccp_find_group(id);
+    return group || id == WCCP_NO_GROUP ? wccp_reasons_of(group, out_places) : nullptr;
 }
 
 int wccp_get_reason_list(int id, wccp_reason_list *list) {
     if (!list)
         return 1;
     const wccp_engine_lock lock;
-    wccp_service_group *group;
-    if (!find_reason_owner(id, &group))
-        return 1;
     uint32_t places;
-    const wccp_reason *const table = wccp_reasons_of(group, &places);
+    const wccp_reason *const table = find_reasons(id, &places);
+    if (!table)
+        return 1;
     list->count = 0;
     for (uint32_t i = 0; i < places; i++)
         if (wccp_reason_holds(&table[i]))
@@ -205,11 +205,10 @@ int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info) {
     if (!info)
         return 1;
     const wccp_engine_lock lock;
-    wccp_service_group *group;
-    if (!find_reason_owner(id, &group))
-        return 1;
     uint32_t places;
-    const wccp_reason *const table = wccp_reasons_of(group, &places);
+    const wccp_reason *const table = find_reasons(id, &places);
+    if (!table)
+        return 1;
     *info = {};
     if (place < 1 || place > places || !wccp_reason_holds(&table[place - 1]))
         return 0;
