@@ -240,7 +240,7 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
         }
     }
     group->bucket_count = 4; // each has its appliance
-    for (const uint32_t method : {1, 2}) {
+    for (const uint32_t method : {1u, 2u}) {
         clear();
         group->assign_method = method;
         group->appliance_view_count = 1;

@@ -525,7 +525,7 @@ TEST_F(Mgmtd, TheFileHoldsEachCommitBeforeItIsTold) {
 
     const auto kept = daemon.tree.set;
     // Neither a device, which a commit would replace, nor a pipe, which would block, is a configuration file.
-    for (const mode_t kind : {S_IFCHR, S_IFIFO}) {
+    for (const mode_t kind : {mode_t{S_IFCHR}, mode_t{S_IFIFO}}) {
         config_file special = {std::string(file) + "/special", {}};
         config_text text;
         unlink(special.path.c_str());

@@ -74,7 +74,7 @@ static void expect_burst(log_daemon *daemon, useconds_t rest_us) {
 }
 
 TEST_P(Syslog, ABurstArrivesWholeAndInOrder) {
-    for (const useconds_t rest_us : {0, 100})
+    for (const useconds_t rest_us : {0u, 100u})
         expect_burst(daemon.get(), rest_us);
 }
 

@@ -211,7 +211,7 @@ static bool take_open_service(transport *self, uint32_t id, session *client, std
     if (refusal) {
         self->owner->say("session of " + client->name + ": service " + std::to_string(service) + " refused");
     } else if (client->stage == session::greeted) {
-        client->stage = session::open;
+        client->stage = session::opened;
         server_peer_opened(self->owner, id, client->name, client->owner);
     }
     return true;
@@ -226,7 +226,7 @@ static void take_frame(transport *self, uint32_t id, session *client, const gcl_
         (void)take_greeting_response(self, client, frame);
     } else if (proto == GCL_PROTO_ADMIN && mtype == GCL_ADMIN_OPEN_SERVICE) {
         (void)take_open_service(self, id, client, frame);
-    } else if (proto == BN_PROTO && client->stage == session::open) {
+    } else if (proto == BN_PROTO && client->stage == session::opened) {
         owned_tbuffer buffer;
         if (tb_new_buf_const(&buffer.pointer, frame.data(), static_cast<uint32_t>(frame.size())) != LC_OK ||
             !server_take_frame(self->owner, id, mtype, buffer.pointer))
@@ -239,7 +239,7 @@ static void take_frame(transport *self, uint32_t id, session *client, const gcl_
 
 static bool header_is_sound(const session &client, const gcl_wire_header &header) {
     const uint32_t total = to_host(header.total_length);
-    const uint32_t most = client.stage == session::open ? GCL_FRAME_MAX : OPENING_FRAME_MAX;
+    const uint32_t most = client.stage == session::opened ? GCL_FRAME_MAX : OPENING_FRAME_MAX;
     return memcmp(header.ident, GCL_FRAME_IDENT, sizeof header.ident) == 0 &&
            to_host(header.version) == GCL_FRAME_VERSION && to_host(header.header_length) == sizeof header &&
            total >= sizeof header && total <= most;
@@ -385,7 +385,7 @@ static int64_t run_timers(transport *self, int64_t timeout_ms) {
     if (now < self->accept_at_ms)
         next = std::min(next, self->accept_at_ms);
     for (auto &[id, client] : self->sessions) {
-        if (client.stage == session::open)
+        if (client.stage == session::opened)
             continue;
         if (now >= client.open_by_ms)
             end_session(self, &client, "did not finish its opening, ended");

@@ -26,7 +26,7 @@ struct session {
     int fd;
     uint32_t uid;
     peer_owner owner;
-    enum { greeting_sent, greeted, open } stage = greeting_sent;
+    enum { greeting_sent, greeted, opened } stage = greeting_sent;
     std::string name; // from the greeting response
     std::string unread;
     std::deque<std::string> queue;
