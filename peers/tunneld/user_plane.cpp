@@ -377,11 +377,12 @@ uint32_t drain_tun(user_state *plane, user_link *link) {
 
 // Packets taken.
 uint32_t serve(user_state *plane, const epoll_event &event) {
-    if (event.data.u64 == WAKE_SERIAL)
+    const uint64_t serial = event.data.u64; // a copy: epoll_event is packed, and the member may be misaligned
+    if (serial == WAKE_SERIAL)
         return 0;
-    if (event.data.u64 == RING_SERIAL)
+    if (serial == RING_SERIAL)
         return drain_ring(plane);
-    const auto found = plane->by_serial.find(event.data.u64);
+    const auto found = plane->by_serial.find(serial);
     if (found == plane->by_serial.end() || found->second->gone)
         return 0;
     return drain_tun(plane, found->second);
