@@ -544,8 +544,8 @@ struct live_plane : testing::Test {
         std::string error;
         EXPECT_TRUE(user_plane.drop_link("wccp0", &error)) << error;
         EXPECT_EQ(if_nametoindex("wccp0"), 0u);
+        shell("ip link del va"); // before the child exits, whose namespace takes it along
         close(commands[1]);
-        shell("ip link del va"); // it would go with the child's namespace, some time after the child
         kill(child, SIGKILL);
         waitpid(child, nullptr, 0);
     }
