@@ -1,11 +1,11 @@
 #!/bin/bash
-# cases.sh: a scenario of several cases, each a lab of its own, some of them side by side.
+# cases.sh: for scenarios that consist of several cases. Each case is a lab of its own, and several run at a time.
 #
 #     source lab/cases.sh
-#     lab_cases "$@"          # DIRECTORY_OF_THE_PROGRAMS [CASE...]; the caller goes on inside the lab of one case
-#     case_one() { ...; }     # functions that begin with case_ are the cases
+#     lab_cases "$@"          # DIRECTORY_OF_THE_PROGRAMS [CASE...]; returns only inside the lab of one case
+#     case_one() { ...; }     # functions whose names begin with case_ are the cases
 #     case_two() { ...; }
-#     lab_case                # runs the one that this lab is for
+#     lab_case                # runs the case that this lab is for
 #
 #   LAB_SIDE_BY_SIDE   how many cases run at a time (default: three for each processor)
 
@@ -15,7 +15,7 @@ source "$(dirname "${BASH_SOURCE[0]}")/topology.sh"
 lab_cases() {
     export WCCP_BIN=${1:-$LAB_TOP/build/release/bin}
     if [ "${LAB_INSIDE-}" != 1 ] && [ "${2-}" != --one ]; then
-        command -v jq >/dev/null || { echo "no jq"; exit 77; }
+        command -v jq >/dev/null || { echo "jq is not installed"; exit 77; }
         local cases out case i failed=0 limit=${LAB_SIDE_BY_SIDE:-$((3 * $(nproc)))}
         mapfile -t cases < <(sed -n 's/^case_\([a-z0-9_]*\)() {.*/\1/p' "$0")
         [ $# -lt 2 ] || cases=("${@:2}")
@@ -40,72 +40,61 @@ lab_cases() {
 }
 lab_case() { "case_$LAB_CASE"; }
 
-# ---- what cases share
+# --- Functions for cases. Those that wait or check end the case when they fail
 
 die() {
     echo "$*" >&2
     tail -n "${LAB_TAIL-12}" "$LAB"/*.log "$LAB"/*.out >&2
     exit 1
 }
-# An appliance with its programs and a configuration.
-appliance() { # NAME ADDRESS [TEXT]...
+start_appliance() { # NAME ADDRESS [TEXT]... : TEXT is its configuration
     lab_appliance "$1" "$2"
     lab_appliance_start "$1" "${@:3}"
 }
-# What a router says of a group: the expression sees it as $g.
-router_is() { # NAME SECONDS GROUP JQ
-    lab_wait "$2" ".groups[\"$3\"] as \$g | $4" lab_ctl "$1" show || die "router $1"
-}
-# The same, when the router simulates several.
-router_at_is() { # NAME ADDRESS SECONDS GROUP JQ
-    lab_wait "$3" ".groups[\"$4\"] as \$g | $5" lab_ctl "$1" "@$2" show || die "router $1 at $2"
-}
-shares() { # ADDRESS BUCKETS : a JQ for router_is
-    echo "([\$g.assignment.buckets[]? | select(. == \"$1\")] | length) == $2"
-}
-role() { # APPLIANCE SECONDS GROUP ROLE
-    lab_wait_role "$2" "$1" "$3" "$4" || die "role of group $3 in $1"
-}
-says() { # APPLIANCE SECONDS LINE (extended regular expression)
-    lab_wait_log "$2" "$1" "$3" || die "log of $1"
-}
-# What the appliance itself says of a group, as nested objects: .oper, .router["1"].state
-group_is() { # APPLIANCE SECONDS GROUP JQ
-    lab_wait "$2" "$4" lab_state "$1" "$3" || die "group $3 of $1"
-}
-# An appliance with a proxy; KEEP as lab_proxy has it.
-proxied() { # NODE ADDRESS KEEP [TEXT]...
+start_proxied() { # NAME ADDRESS KEEP [TEXT]... : an appliance with a proxy; KEEP is "keep" or empty, as in lab_proxy
     lab_appliance "$1" "$2"
     lab_gateway "$1" 10.0.0.1
     # shellcheck disable=SC2086
     lab_proxy "$1" 3129 $3
     lab_appliance_start "$1" "${@:4}"
 }
-# The appliances own all of the group's table, and their proxies are up.
-ready() { # GROUP APPLIANCE...
-    local group=$1 node; shift
-    router_is r1 60 "$group" "([\$g.assignment.buckets[]?, \$g.assignment.masks[]?.values[].owner] | unique | length == $# and all(.[]; .))"
-    for node; do state_is "$node" 20 intercept 'length > 0 and all(.[]; .proxy == "up" and .active)'; done
-}
-# Nodes of tunneld below /qv/tunneld/KIND/state, as nested objects.
-state() { # NODE KIND
-    lab_manage "$1" walk "/qv/tunneld/$2/state" 2>/dev/null | jq -c '
-        (arrays // []) |
-        (reduce (.[].name | split("/") | range(1; length) as $depth | .[:$depth] | join("/")) as $above ({}; .[$above] = true)) as $parents |
-        map(select($parents[.name] | not)) |
-        reduce .[] as $node ({}; setpath($node.name | split("/")[5:]; $node.value))'
-}
-state_is() { # NODE SECONDS KIND JQ
-    lab_wait "$2" "$4" state "$1" "$3" || die "$3 of $1"
-}
 configure() { # APPLIANCE [TEXT]...
     lab_configure "$@" || die "configuration of $1"
 }
-# The end of a case: every appliance ends in order, and nothing was said at error level that isn't explained.
-finish() { # APPLIANCE... [-- EXPLAINED...]
+# The state of a router; JQ refers to the group as $g.
+router_is() { # NAME SECONDS GROUP JQ
+    lab_wait "$2" ".groups[\"$3\"] as \$g | $4" lab_ctl "$1" show || die "router $1"
+}
+router_at_is() { # NAME ADDRESS SECONDS GROUP JQ : one of several routers in a node
+    lab_wait "$3" ".groups[\"$4\"] as \$g | $5" lab_ctl "$1" "@$2" show || die "router $1 at $2"
+}
+shares() { # ADDRESS BUCKETS : prints a JQ for router_is
+    echo "([\$g.assignment.buckets[]? | select(. == \"$1\")] | length) == $2"
+}
+# The state of a group in the appliance, as lab_state prints it: .oper, .router["1"].state
+group_is() { # APPLIANCE SECONDS GROUP JQ
+    lab_wait "$2" "$4" lab_state "$1" "$3" || die "group $3 of $1"
+}
+tunneld_is() { # APPLIANCE SECONDS KIND JQ : as lab_tunneld_state prints it
+    lab_wait "$2" "$4" lab_tunneld_state "$1" "$3" || die "$3 of $1"
+}
+wait_role() { # APPLIANCE SECONDS GROUP ROLE
+    lab_wait_role "$2" "$1" "$3" "$4" || die "role of group $3 in $1"
+}
+wait_log() { # APPLIANCE SECONDS EXPRESSION
+    lab_wait_log "$2" "$1" "$3" || die "log of $1"
+}
+# Waits until these appliances own the group's whole table and their proxies are up.
+wait_ready() { # GROUP APPLIANCE...
+    local group=$1 node; shift
+    router_is r1 60 "$group" "([\$g.assignment.buckets[]?, \$g.assignment.masks[]?.values[].owner] | unique | length == $# and all(.[]; .))"
+    for node; do tunneld_is "$node" 20 intercept 'length > 0 and all(.[]; .proxy == "up" and .active)'; done
+}
+# Ends the programs of the appliances, and checks that nothing is left and that no unexpected error was logged.
+finish() { # APPLIANCE... [-- EXPECTED...]
     local nodes=() node
     while [ $# -gt 0 ] && [ "$1" != -- ]; do nodes+=("$1"); shift; done
     [ $# -eq 0 ] || shift
-    lab_end "${nodes[@]}" || die "the end"
-    for node in "${nodes[@]}"; do lab_clean_log "$node" "$@" || die "not clean"; done
+    lab_end "${nodes[@]}" || die "end of ${nodes[*]}"
+    for node in "${nodes[@]}"; do lab_clean_log "$node" "$@" || die "log of $node"; done
 }

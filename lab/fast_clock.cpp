@@ -1,14 +1,14 @@
-// A faster clock for the programs of a lab, preloaded into them: with FAST_CLOCK=8 the seconds of their
-// timers pass in an eighth of the time.
+// A library for LD_PRELOAD that gives the programs of a lab a faster clock: with FAST_CLOCK=8 their timers
+// run eight times as fast.
 //
-// The clocks that count from the start of the machine run faster, and what waits for time (sleeps, and the
-// limits of poll and epoll_wait) waits accordingly shorter. As all programs multiply the same clock, they
-// agree on it. Two things keep their pace, because they are about real work and not about the seconds of a
-// protocol: the time of day, by which the sessions with mgmtd limit their waiting and log lines are stamped;
-// and waits of up to LEAST_WAIT, of which some are counted until another process has answered.
+// Clocks that count from boot run faster, and sleeps and the timeouts of poll and epoll_wait are shorter
+// accordingly. All programs multiply the same clock, therefore they agree on the time. Two things keep real
+// time, because they concern work and not the protocol: the time of day, which timeouts of sessions with
+// mgmtd and log lines use; and waits of up to LEAST_WAIT, which some programs repeat a fixed number of times
+// while another process works.
 //
-// The real functions are found by name in the libraries after this one. They remain what waits, so that a
-// thread can be cancelled in them as ever.
+// The replaced functions call the real ones, found by name in the libraries after this one, and the real ones
+// do the waiting: threads can be cancelled in them as without this library.
 #include <dlfcn.h>
 #include <poll.h>
 #include <sys/epoll.h>
@@ -25,7 +25,7 @@ namespace {
 constexpr int64_t SECOND = 1'000'000'000, MILLISECOND = 1'000'000;
 constexpr int64_t LEAST_WAIT = 20 * MILLISECOND;
 
-int64_t speed() {
+int64_t clock_speed() {
     static const int64_t factor = [] {
         const char *text = getenv("FAST_CLOCK");
         return std::clamp<int64_t>(text ? atoi(text) : 1, 1, 60);
@@ -34,14 +34,14 @@ int64_t speed() {
 }
 
 template <typename function>
-function *behind(function *, const char *name) {
+function *find_real(function *, const char *name) {
     return reinterpret_cast<function *>(dlsym(RTLD_NEXT, name));
 }
-// A function without a local guard: cancelled in its first call, a guard would stay taken.
+// No initializer for the static variable: if the thread is cancelled during it, the guard would stay locked.
 #define REAL(name)                                                                                           \
     static decltype(&::name) real_##name;                                                                    \
     if (!real_##name)                                                                                        \
-        real_##name = behind(&::name, #name);
+        real_##name = find_real(&::name, #name);
 
 int64_t to_ns(const timespec &time) {
     return time.tv_sec * SECOND + time.tv_nsec;
@@ -49,11 +49,11 @@ int64_t to_ns(const timespec &time) {
 timespec from_ns(int64_t ns) {
     return {ns / SECOND, ns % SECOND};
 }
-int64_t shorter(int64_t ns) {
-    return std::max(ns / speed(), std::min(ns, LEAST_WAIT));
+int64_t shorten_wait(int64_t ns) {
+    return std::max(ns / clock_speed(), std::min(ns, LEAST_WAIT));
 }
-int shorter_ms(int ms) {
-    return ms <= 0 ? ms : static_cast<int>((shorter(ms * MILLISECOND) + MILLISECOND - 1) / MILLISECOND);
+int shorten_wait_ms(int ms) {
+    return ms <= 0 ? ms : static_cast<int>((shorten_wait(ms * MILLISECOND) + MILLISECOND - 1) / MILLISECOND);
 }
 bool is_fast(clockid_t clock) {
     return clock == CLOCK_MONOTONIC || clock == CLOCK_MONOTONIC_COARSE || clock == CLOCK_MONOTONIC_RAW ||
@@ -68,17 +68,17 @@ int clock_gettime(clockid_t clock, timespec *out) noexcept {
     REAL(clock_gettime)
     const int result = real_clock_gettime(clock, out);
     if (result == 0 && is_fast(clock))
-        *out = from_ns(to_ns(*out) * speed());
+        *out = from_ns(to_ns(*out) * clock_speed());
     return result;
 }
 
 int clock_nanosleep(clockid_t clock, int flags, const timespec *time, timespec *left) {
     REAL(clock_nanosleep)
     if (flags & TIMER_ABSTIME) {
-        const timespec until = is_fast(clock) ? from_ns(to_ns(*time) / speed()) : *time;
+        const timespec until = is_fast(clock) ? from_ns(to_ns(*time) / clock_speed()) : *time;
         return real_clock_nanosleep(clock, flags, &until, left);
     }
-    const int64_t asked = to_ns(*time), wait = shorter(asked);
+    const int64_t asked = to_ns(*time), wait = shorten_wait(asked);
     const timespec part = from_ns(wait);
     const int result = real_clock_nanosleep(clock, flags, &part, left);
     if (result != 0 && left && wait > 0)
@@ -102,12 +102,12 @@ unsigned sleep(unsigned seconds) {
 
 int poll(pollfd *fds, nfds_t count, int ms) {
     REAL(poll)
-    return real_poll(fds, count, shorter_ms(ms));
+    return real_poll(fds, count, shorten_wait_ms(ms));
 }
 
 int epoll_wait(int fd, epoll_event *events, int count, int ms) {
     REAL(epoll_wait)
-    return real_epoll_wait(fd, events, count, shorter_ms(ms));
+    return real_epoll_wait(fd, events, count, shorten_wait_ms(ms));
 }
 
 } // extern "C"

@@ -1,90 +1,93 @@
 #!/bin/bash
-# topology.sh: a small network of namespaces: a bridge, and on it any number of routers and appliances.
+# topology.sh: a network of namespaces with simulated routers and complete appliances on one bridge.
 #
 # As a library, at the top of a script that was started as a file:
 #     source lab/topology.sh
 #     lab_enter "$0" "$@"                     # from here on the script runs inside; nothing outlives it
-#     lab_router r1 10.0.0.1 -- --form nexus  # wccp_router on that address, its control socket and its log
+#     lab_router r1 10.0.0.1 -- --format nexus  # wccp_router on that address, with a control socket and a log
 #     lab_appliance a1 10.0.0.101             # namespaces and a log daemon; no program yet
-#     lab_appliance_start a1 "$(lab_group 51 10.0.0.1 weight=7)"      # mgmtd, tunneld and wccpd, each ready
+#     lab_appliance_start a1 "$(lab_group 51 10.0.0.1 weight=7)"      # starts mgmtd, tunneld and wccpd
 #     lab_wait_role 30 a1 51 ACTIVE
 #     lab_wait 30 '.groups["51"].assignment.kind == "hash"' lab_ctl r1 show
-#     lab_configure a1 "$(lab_group 51 10.0.0.1 weight=9)"            # all of the configuration anew
-#     lab_end a1                              # stopped in order; nothing is left
-#     lab_clean_log a1 'a line at error level that is explained'
+#     lab_configure a1 "$(lab_group 51 10.0.0.1 weight=9)"            # replaces the whole configuration
+#     lab_end a1                              # stops the programs and checks that nothing is left
+#     lab_clean_log a1 'an error that is expected'
 # As a command:
-#     topology.sh [--routers N] [--appliances N] [COMMAND...]    a network to try things in; a shell without COMMAND
+#     topology.sh [--routers N] [--appliances N] [COMMAND...]    runs COMMAND, or a shell, in such a network
 #
-# Of an appliance, its programs and what they tell (NODE is a name such as a1):
-#     lab_appliance NODE ADDRESS...           namespaces; `lab_kill NODE` is the loss of its power
-#     lab_group ID [ROUTER]... [NAME=VALUE]...    prints a group's section; interface eth0 unless told
-#     lab_appliance_start NODE [TEXT]...      with that configuration: any lines of mgmtd's file (docs/mgmtd.md)
-#     lab_configure NODE [TEXT]...            writes it anew, whole, and waits until mgmtd has taken it (1: refused)
-#     lab_mgmtd_start NODE, lab_wccpd_start NODE    one of them again, until it is ready
-#     lab_supervise NODE                      mgmtd that starts tunneld and wccpd, after lab_write_config NODE [TEXT]...
+# Appliances and their programs (NODE is a name such as a1; EXPRESSION is for grep -E):
+#     lab_appliance NODE ADDRESS...           creates its namespaces
+#     lab_kill NODE                           ends everything in it at once, like a loss of power
+#     lab_group ID [ROUTER]... [NAME=VALUE]...    prints the section of a group, on interface eth0 by default
+#     lab_intercept GROUP [NAME=VALUE]...     prints the section of an intercept, to port 3129 by default
+#     lab_appliance_start NODE [TEXT]...      starts the programs; TEXT is lines of mgmtd's file (docs/mgmtd.md)
+#     lab_configure NODE [TEXT]...            replaces the file and waits until mgmtd has read it (1: refused)
+#     lab_mgmtd_start NODE, lab_wccpd_start NODE    starts one of them again and waits until it is ready
+#     lab_supervise NODE                      starts mgmtd, which starts tunneld and wccpd, with the configuration from
+#                                             lab_write_config NODE [TEXT]...
 #     lab_manage NODE WORDS...                mgmtctl --json WORDS inside the appliance
-#     lab_state NODE [GROUP]                  the groups by number, or one of them: the monitoring nodes as one JSON object
-#     lab_events NODE                         the lines of mgmtd since its start: sessions, commits, alarms, roles
-#     lab_role NODE GROUP                     the role that was last reported: ACTIVE, BACKUP, UNKNOWN
+#     lab_state NODE [GROUP]                  the monitoring nodes of all groups by number, or of one, as a JSON object
+#     lab_tunneld_state NODE KIND             the same of tunneld: KIND is intercept, plane or tunnel
+#     lab_events NODE                         the output of mgmtd since its start: sessions, commits, alarms, roles
+#     lab_role NODE GROUP                     the role that was reported last: ACTIVE, BACKUP, UNKNOWN
 #     lab_wait_role SECONDS NODE GROUP ROLE
-#     lab_wait_event SECONDS NODE EXPRESSION  a line of mgmtd's
-#     lab_wait_log SECONDS NODE EXPRESSION    a line of the log (grep -E); what stood there before lab_mark NODE
-#     lab_mark NODE                           doesn't count
+#     lab_wait_event SECONDS NODE EXPRESSION  waits for a line in the output of mgmtd
+#     lab_wait_log SECONDS NODE EXPRESSION    waits for a line in the log, after the last lab_mark NODE
 #     lab_log NODE                            the log since lab_mark
 #     lab_start NODE NAME PROGRAM..., lab_stop NODE NAME [SIGNAL], lab_alive NODE NAME, lab_pid NODE NAME
-#                                             one program: NAME is mgmtd, tunneld or wccpd
-#     lab_wait_exit SECONDS NODE NAME         waits until it ends by itself; its status, or 124
-#     lab_end NODE...                         SIGTERM to wccpd, tunneld and mgmtd in turn, each ends with 0 (or has
-#                                             ended before), and no process, segment, socket or interface is left
-#     lab_clean_log NODE [EXPRESSION...]      no line at error level or worse but those, no finding of a sanitizer
+#                                             one program; NAME is mgmtd, tunneld, wccpd or any other
+#     lab_wait_exit SECONDS NODE NAME         waits until it exits by itself; the result is its status, or 124
+#     lab_end NODE...                         sends SIGTERM to wccpd, tunneld and mgmtd in turn. Fails if one of them
+#                                             exits with an error, or leaves a process, segment, socket or interface
+#     lab_clean_log NODE [EXPRESSION...]      fails on a log line of level error or worse that matches no EXPRESSION,
+#                                             and on a finding of a sanitizer
 #
-# Traffic: a router that was started with `--redirect c1=51` redirects what comes in from c1.
-#     lab_client NODE ROUTER [NET]            a namespace behind the router: NET.2, and NET.128 to NET.255 to fetch from
-#                                             (NET is the first three numbers, default 10.1.0)
+# Traffic: a router that is started with `--redirect c1=51` redirects packets that come in from c1.
+#     lab_client NODE ROUTER [NET]            a namespace behind the router, with NET.2, and NET.128 to NET.255 to fetch
+#                                             from (NET is the first three numbers, default 10.1.0)
 #     lab_server NODE ROUTER [NET]            the same at NET.2 (default 10.2.0), with web servers on ports 80 and 8080
-#     lab_gateway NODE ADDRESS                the default route of a node
+#     lab_gateway NODE ADDRESS                sets the default route of a node
 #     lab_fetch CLIENT [OPTIONS...]           `wccp_router fetch` from the client's addresses to the server 10.2.0.2
-#     lab_proxy NODE [PORT] [keep]            haproxy in an appliance, on port 3129, answering with "X-Proxy: NODE"; with
-#                                             `keep` it connects from the client's address. Stop it with lab_stop NODE proxy
-#     lab_intercept GROUP [NAME=VALUE]...     prints the section of an intercept, to port 3129 unless told
+#     lab_proxy NODE [PORT] [keep]            starts haproxy in an appliance, on port 3129 by default; it answers with
+#                                             "X-Proxy: NODE", and with `keep` connects from the client's address.
+#                                             Stop it with lab_stop NODE proxy
 #
-# How it holds together: lab_enter runs the script again as the first process of its own process, mount and network
-# namespaces (and of a user namespace, when started by an ordinary user). Every other namespace is held by a process
-# below that one, no name is bound and no file is made outside, so that whatever ends the script, be it kill -9 of
-# any of its processes, ends all of it: the kernel clears away the rest. Files of the lab (logs, sockets) live in
-# $LAB, a tmpfs in the private mount namespace; copy out what is to be kept.
+# lab_enter runs the script again as the first process of new process, mount and network namespaces (and of a user
+# namespace if an ordinary user started it). Every other namespace is held by a process below that one, and nothing is
+# created outside. Therefore whatever ends the script, even kill -9 of any of its processes, ends all of it, and the
+# kernel cleans up. Logs and sockets are in $LAB, a tmpfs in the private mount namespace; copy out what is to be kept.
 #
-#   WCCP_BIN    where the programs are (default: build/release/bin)
-#   LAB_KEEP    a directory to which logs are copied when the script ends by itself
-#   LAB_SPEED   how many of its seconds the protocol gets into one (default 1); wccpd, tunneld and wccp_router run by
-#               that clock (lab/fast_clock.cpp), mgmtd and mgmtctl, whose limits are about work, by the wall's.
-#               SECONDS of all functions here are the wall's, but for lab_sleep, which sleeps for the protocol's.
-#   LAB_TUNNELD     options of tunneld that lab_appliance_start gives; "none" starts none
-#   LAB_PLANE       its data plane (default table, which carries nothing); empty: whatever the kernel can do
-#   LAB_LOG_LEVEL   of wccpd, in the configuration that lab_appliance_start writes (default info)
+#   WCCP_BIN    directory of the programs (default: build/release/bin)
+#   LAB_KEEP    a directory to which the logs are copied when the script ends by itself
+#   LAB_SPEED   how much faster than real time the protocol runs (default 1): the clock of wccpd, tunneld and
+#               wccp_router (lab/fast_clock.cpp). mgmtd and mgmtctl, whose time limits concern work and not the protocol,
+#               keep real time. SECONDS of all functions are real seconds, except for lab_sleep.
+#   LAB_TUNNELD     options that lab_appliance_start passes to tunneld; "none": do not start it
+#   LAB_PLANE       its data plane (default table, which carries no packets); empty: the best that the kernel supports
+#   LAB_LOG_LEVEL   log level of wccpd in the configuration that lab_write_config writes (default info)
 
 LAB_HOME=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
 LAB_TOP=$(dirname "$LAB_HOME")
 : "${WCCP_BIN:=$LAB_TOP/build/release/bin}"
 : "${LAB_SPEED:=1}" "${LAB_LOG_LEVEL:=info}" "${LAB_PLANE=table}"
 LAB_CONFIG=/etc/opt/rvl/mgmtd.conf # inside an appliance
-declare -A LAB_INIT LAB_PID        # first process of an appliance; programs as NODE/NAME
-declare -A LAB_MARKED LAB_FOUND    # lines of the log that don't count; what an appliance held before its programs
-declare -A LAB_KILLED              # sockets that programs had no chance to remove, as an expression
-declare -A LAB_BARE                # nodes that have a network namespace alone: routers, clients, servers
-declare -A LAB_NET                 # the net of a client or server
+declare -A LAB_INIT LAB_PID        # first process of a node; programs by NODE/NAME
+declare -A LAB_MARKED LAB_FOUND    # log lines before lab_mark; output of lab_remains before the programs started
+declare -A LAB_KILLED              # sockets that killed programs could not remove, as an expression
+declare -A LAB_BARE                # nodes with a network namespace only: routers, clients, servers
+declare -A LAB_NET                 # the network of a client or server
 
 lab_die() { echo "lab: $*" >&2; exit 1; }
 
-# ---- the outer side
+# --- Outside the namespaces
 
 lab_enter() { # SCRIPT ARGUMENTS...
     if [ "${LAB_INSIDE-}" = 1 ]; then lab_set_up; return; fi
     local script user=()
     script=$(readlink -f "$1"); shift
     [ "$(id -u)" = 0 ] || user=(--user --map-root-user)
-    # The holder dies with this shell (pdeathsig), and everything with the holder (--kill-child). Started in the
-    # background, because a shell runs its traps only then; job control gives neither terminal nor signals away.
+    # The holder dies with this shell (pdeathsig), and everything else with the holder (--kill-child). It runs in the
+    # background because a shell runs its traps only while it waits.
     LAB_INSIDE=1 setpriv --pdeathsig KILL bash -c '[ $PPID = "$0" ] && LAB_HOLDER=$$ exec "$@"' $$ \
         env --default-signal=INT,QUIT unshare "${user[@]}" --mount --net --pid --fork --kill-child \
         --propagation private bash "$script" "$@" <&0 &
@@ -98,19 +101,19 @@ lab_enter() { # SCRIPT ARGUMENTS...
     exit $status
 }
 
-# ---- the inner side
+# --- Inside: the network
 
 lab_set_up() {
-    # A holder that was killed just after its fork could not yet arrange that this shell dies with it. /proc still
-    # shows the processes outside.
+    # If the holder was killed right after its fork, this shell was not yet set up to die with it. /proc still shows the
+    # processes outside.
     grep -qs '^State:[[:space:]]*[^ZX]' "/proc/$LAB_HOLDER/status" || exit 1
-    mount -t proc proc /proc || lab_die "no /proc of our own"
+    mount -t proc proc /proc || lab_die "cannot mount /proc"
     local aside
     for aside in /media /srv /mnt /opt; do
         [ -d $aside ] || continue
         case "$LAB_TOP/ $WCCP_BIN/ $PWD/ ${LAB_KEEP-}/" in $aside/* | *" $aside/"*) ;; *) break ;; esac
     done
-    mount -t tmpfs tmpfs $aside || lab_die "no file system of our own"
+    mount -t tmpfs tmpfs $aside || lab_die "cannot mount a file system on $aside"
     LAB=$aside/lab
     mkdir $LAB
     trap 'lab_collect' EXIT
@@ -130,7 +133,7 @@ lab_collect() {
     return $status
 }
 
-# Waits until a process has namespaces of its own of that kind.
+# Waits until a process has left our namespace of that kind.
 lab_wait_namespace() { # PID KIND
     local own i
     own=$(readlink "/proc/$$/ns/$2")
@@ -141,7 +144,7 @@ lab_wait_namespace() { # PID KIND
     lab_die "process $1 has no $2 namespace"
 }
 
-# Gives the network namespace of a process an eth0 on the bridge.
+# Adds an eth0, connected to the bridge, to the network namespace of a process.
 lab_plug() { # NODE PID ADDRESS...
     local node=$1 pid=$2 address; shift 2
     ip link add "v-$node" type veth peer name eth0 netns "$pid" || lab_die "no veth for $node"
@@ -153,7 +156,7 @@ lab_plug() { # NODE PID ADDRESS...
     return 0
 }
 
-# A namespace with wccp_router in it, on one or more addresses.
+# Creates a namespace with a wccp_router that simulates a router on each address.
 lab_router() { # NAME ADDRESS... [-- OPTIONS OF wccp_router]
     local node=$1 addresses=() which=(); shift
     while [ $# -gt 0 ] && [ "$1" != -- ]; do addresses+=("$1"); which+=(--router "$1"); shift; done
@@ -163,14 +166,14 @@ lab_router() { # NAME ADDRESS... [-- OPTIONS OF wccp_router]
     lab_route_start "$node" "${which[@]}" "$@"
     lab_redirect "$node"
 }
-# A network namespace, held by a process.
+# Creates a network namespace, held by a process.
 lab_bare() { # NODE
     unshare --net sleep infinity </dev/null &
     LAB_INIT[$1]=$! LAB_BARE[$1]=yes
     lab_wait_namespace "${LAB_INIT[$1]}" net
 }
-# What comes in by interface X goes into the router's device to-X. What the router writes back there has come in by
-# to-X, and takes the main table.
+# Routes packets that come in on interface X into the router's device to-X. What the router writes back into to-X comes
+# in on that device, and therefore follows the main table.
 lab_redirect() { # ROUTER
     # shellcheck disable=SC2016
     lab_in "$1" bash -c '
@@ -188,9 +191,9 @@ lab_redirect() { # ROUTER
         echo 0 >/proc/sys/net/ipv4/conf/all/rp_filter
         echo 0 >/proc/sys/net/ipv4/conf/default/rp_filter
         echo 0 >/proc/sys/net/ipv4/conf/eth0/rp_filter
-        echo 1 >/proc/sys/net/ipv4/ip_forward' || lab_die "router $1 does not forward"
+        echo 1 >/proc/sys/net/ipv4/ip_forward' || lab_die "cannot set up forwarding in router $1"
 }
-# A node behind a router, by an interface that has the node's name there.
+# Creates a node behind a router; the router's interface has the node's name.
 lab_behind() { # NODE ROUTER NET
     local node=$1 router=$2 net=$3
     lab_bare "$node"
@@ -206,7 +209,7 @@ lab_behind() { # NODE ROUTER NET
     lab_gateway "$node" "$net.1"
 }
 lab_gateway() { # NODE ADDRESS
-    lab_in "$1" ip route replace default via "$2" || lab_die "no route of $1"
+    lab_in "$1" ip route replace default via "$2" || lab_die "cannot set the default route of $1"
 }
 lab_client() { # NODE ROUTER [NET]
     lab_behind "$1" "$2" "${3-10.1.0}"
@@ -220,7 +223,7 @@ lab_server() { # NODE ROUTER [NET]
         [ "$(lab_in "$1" cat /proc/net/tcp | grep -cE ' 0+:(0050|1F90) 0+:0+ 0A')" != 2 ] || return 0
         sleep 0.05
     done
-    lab_die "the web server of $1 does not start"
+    lab_die "the web server of $1 did not start"
 }
 lab_fetch() { # CLIENT [OPTIONS...]
     lab_in "$1" "$WCCP_BIN/wccp_router" fetch --from "${LAB_NET[$1]}.128" 10.2.0.2 "${@:2}"
@@ -235,9 +238,9 @@ lab_proxy() { # NODE [PORT] [keep]
         sleep 0.05
     done
     cat "$LAB/$1-proxy.out" >&2
-    lab_die "the proxy of $1 does not start"
+    lab_die "the proxy of $1 did not start"
 }
-lab_route_start() { # NAME OPTIONS... : (again) after lab_stop NAME router
+lab_route_start() { # NAME OPTIONS... : also after lab_stop NAME router
     local node=$1; shift
     lab_clock
     nsenter -t "${LAB_INIT[$node]}" --net "${LAB_CLOCK[@]}" "$WCCP_BIN/wccp_router" --control "$LAB/$node.ctl" --json "$@" \
@@ -253,7 +256,7 @@ lab_route_start() { # NAME OPTIONS... : (again) after lab_stop NAME router
     lab_die "router $node did not start"
 }
 
-# Namespaces of an appliance, with a log daemon as their first process: when it dies, all in there dies with it.
+# Creates the namespaces of an appliance, with a log daemon as their first process: when it dies, all of them end.
 lab_appliance() { # NAME ADDRESS...
     local node=$1 outer i; shift
     "$LAB_HOME/in-appliance" "$WCCP_BIN/wccp_router" logd - </dev/null >"$LAB/$node.log" 2>"$LAB/$node.out" &
@@ -261,26 +264,26 @@ lab_appliance() { # NAME ADDRESS...
     for i in $(seq 200); do
         LAB_INIT[$node]=$(cat "/proc/$outer/task/$outer/children" 2>/dev/null)
         LAB_INIT[$node]=${LAB_INIT[$node]%% *}
-        # ready when the log daemon has taken the place of the shell that set it up
+        # Ready when the log daemon has replaced the shell that set up the namespaces.
         [ -n "${LAB_INIT[$node]}" ] && [ "$(cat "/proc/${LAB_INIT[$node]}/comm" 2>/dev/null)" = wccp_router ] &&
             [ -S "/proc/${LAB_INIT[$node]}/root/dev/log" ] && break
         kill -0 $outer 2>/dev/null || { cat "$LAB/$node.out" >&2; lab_die "appliance $node did not start"; }
         sleep 0.02
     done
-    cp "$LAB_TOP"/packaging/*.conf "/proc/${LAB_INIT[$node]}/root/etc/opt/rvl/" || lab_die "no platform files for $node"
+    cp "$LAB_TOP"/packaging/*.conf "/proc/${LAB_INIT[$node]}/root/etc/opt/rvl/" || lab_die "cannot copy the platform files to $node"
     lab_plug "$node" "${LAB_INIT[$node]}" "$@"
 }
 
-# Runs a command inside a node: an appliance with all its namespaces, a router with its network.
+# Runs a command in all namespaces of an appliance, or in the network namespace of another node.
 lab_in() { # NAME COMMAND...
     local node=$1 all=(); shift
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
-    # The root as well: the whole lab may run inside a chroot.
+    # --root, because the whole lab may run inside a chroot.
     [ -n "${LAB_BARE[$node]-}" ] || all=(--mount --root --ipc --pid --wdns=/)
     (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net "${all[@]}" "$@")
 }
 
-# What a program is started with to run by the clock of the protocol: LAB_CLOCK.
+# Sets LAB_CLOCK to the command prefix that makes a program run by the clock of the protocol.
 lab_clock() {
     local library
     LAB_CLOCK=()
@@ -290,11 +293,11 @@ lab_clock() {
     LAB_CLOCK=(env "LD_PRELOAD=$library" "FAST_CLOCK=$LAB_SPEED"
         "ASAN_OPTIONS=${ASAN_OPTIONS:+$ASAN_OPTIONS:}verify_asan_link_order=0")
 }
-lab_sleep() { # SECONDS of the protocol
+lab_sleep() { # SECONDS : in the time of the protocol
     sleep "$(awk "BEGIN { print $1 / $LAB_SPEED }")"
 }
 
-# Starts a program inside an appliance; a bare name is one of ours. Its output goes to $LAB/NODE-NAME.out.
+# Starts a program inside an appliance; a name without a slash is one of ours. Its output goes to $LAB/NODE-NAME.out.
 lab_start() { # NODE NAME PROGRAM ARGUMENTS...
     local node=$1 name=$2 program=$3; shift 3
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
@@ -308,7 +311,7 @@ lab_start() { # NODE NAME PROGRAM ARGUMENTS...
     LAB_PID[$node/$name]=$!
 }
 
-# The process that a program runs in, as seen from here.
+# Prints the process id of a program in our process namespace.
 lab_pid() { # NODE NAME
     local pid=${LAB_PID[$1/$2]-}
     [ -n "$pid" ] || lab_die "there is no $2 in $1"
@@ -318,14 +321,15 @@ lab_pid() { # NODE NAME
 lab_alive() { # NODE NAME
     kill -0 "${LAB_PID[$1/$2]}" 2>/dev/null
 }
-# Sends a signal to a program (TERM), and waits for it to end; the result is its status, or 124 after 15 seconds.
+# Sends a signal (TERM by default) to a program and waits until it exits; the result is its status, or 124 after 15
+# seconds.
 lab_stop() { # NODE NAME [SIGNAL]
     local pid=${LAB_PID[$1/$2]} inner i
     inner=$(lab_pid "$1" "$2")
     if [ -n "$inner" ]; then
         [ "${3-}" != KILL ] || lab_expect_sockets "$1" "$2" "$inner"
         kill -s "${3-TERM}" "$inner"
-        kill -s CONT "$pid" 2>/dev/null # nsenter stops itself with a program that was stopped
+        kill -s CONT "$pid" 2>/dev/null # nsenter stops itself when its program is stopped
     fi
     for i in $(seq 300); do
         kill -0 "$pid" 2>/dev/null || { wait "$pid"; return; }
@@ -333,8 +337,8 @@ lab_stop() { # NODE NAME [SIGNAL]
     done
     return 124
 }
-# After kill -STOP of lab_pid. nsenter has stopped itself with the program, and continues it when it is continued. A
-# SIGCONT that came later, while the program ends under the leak checker, would take back the checker's SIGSTOP.
+# Continues a program after kill -STOP of lab_pid. nsenter has stopped itself with the program, and passes SIGCONT on.
+# The wait is needed because a SIGCONT that arrives when the program exits would undo the leak checker's SIGSTOP.
 lab_continue() { # NODE NAME
     kill -s CONT "${LAB_PID[$1/$2]}"
     lab_wait_line 5 '^State:[[:space:]]*[^T]' "/proc/$(lab_pid "$1" "$2")/status"
@@ -345,7 +349,7 @@ lab_expect_sockets() { # NODE NAME PID
     LAB_KILLED[$1]+="|uds-client-$2-$own\$"
     [ "$2" != mgmtd ] || LAB_KILLED[$1]+='|uds-provider-mgmtd$'
 }
-# Waits for a program to end without being told to: its status, or 124.
+# Waits until a program exits by itself; the result is its status, or 124.
 lab_wait_exit() { # SECONDS NODE NAME
     local i
     for ((i = 0; i < $1 * 20; i++)); do
@@ -354,7 +358,6 @@ lab_wait_exit() { # SECONDS NODE NAME
     done
     return 124
 }
-# The whole node at once, as if its power had gone.
 lab_kill() { # NODE
     local key pids=("${LAB_INIT[$1]}")
     for key in "${!LAB_PID[@]}"; do
@@ -366,17 +369,17 @@ lab_kill() { # NODE
     ip link del "v-$1" 2>/dev/null
     unset "LAB_INIT[$1]"
 }
-lab_link() { # NODE up|down : the cable of a node
+lab_link() { # NODE up|down : plugs or unplugs the cable of eth0
     ip link set "v-$1" "$2"
 }
 
-lab_ctl() { # ROUTER COMMAND... : one command to a router
+lab_ctl() { # ROUTER COMMAND... : sends a command to a simulated router
     local node=$1; shift
     "$WCCP_BIN/wccp_router" ctl "$LAB/$node.ctl" "$@"
 }
 
-# Runs the command until its output, JSON, makes the jq expression true: 0, or 1 when the seconds are over (and the
-# last output is shown).
+# Runs a command repeatedly until the jq expression is true for its output. After that many seconds it prints the last
+# output, and the result is 1.
 lab_wait() { # SECONDS EXPRESSION COMMAND...
     local limit=$1 expression=$2 began=$SECONDS last; shift 2
     while :; do
@@ -384,11 +387,11 @@ lab_wait() { # SECONDS EXPRESSION COMMAND...
         [ $((SECONDS - began)) -lt "$limit" ] || break
         sleep 0.2
     done
-    echo "lab: after $limit s still not: $expression" >&2
+    echo "lab: not true after $limit s: $expression" >&2
     [ "${#last}" -lt 4000 ] && echo "$last" >&2
     return 1
 }
-# The same for a line of text in a file (an extended regular expression).
+# Waits for a line in a file.
 lab_wait_line() { # SECONDS EXPRESSION FILE
     local began=$SECONDS
     until grep -Eq -- "$2" "$3" 2>/dev/null; do
@@ -397,7 +400,7 @@ lab_wait_line() { # SECONDS EXPRESSION FILE
     done
 }
 
-# ---- the programs of an appliance
+# --- The programs of an appliance
 
 lab_group() { # ID [ROUTER]... [NAME=VALUE]...
     local word n=0
@@ -435,8 +438,7 @@ lab_tunneld_start() { # NODE OPTIONS...
     # shellcheck disable=SC2086
     lab_start "$1" tunneld tunneld ${LAB_PLANE:+--plane $LAB_PLANE} "${@:2}"
 }
-# mgmtd, whose patience is by the wall's clock, with programs under it that run by the protocol's, in the configuration
-# that lab_write_config has written.
+# mgmtd keeps real time and starts programs that run by the clock of the protocol, therefore through scripts.
 lab_supervise() { # NODE
     local program directory=/proc/${LAB_INIT[$1]}/root/run/wccpd options=
     [ -n "${LAB_FOUND[$1]+known}" ] || LAB_FOUND[$1]=$(lab_remains "$1")
@@ -449,14 +451,14 @@ lab_supervise() { # NODE
     done
     : >"$LAB/$1-mgmtd.out"
     lab_start "$1" mgmtd mgmtd --config "$LAB_CONFIG" --supervise --wccpd /run/wccpd/wccpd --tunneld /run/wccpd/tunneld
-    lab_wait_event 20 "$1" '^mgmtd ready' || lab_show_and_die "$1" "mgmtd of $1 does not start"
+    lab_wait_event 20 "$1" '^mgmtd ready' || lab_show_and_die "$1" "mgmtd of $1 did not start"
 }
 lab_mgmtd_start() { # NODE
     : >"$LAB/$1-mgmtd.out"
     local killed=${LAB_KILLED[$1]-}
     LAB_KILLED[$1]=${killed//'|uds-provider-mgmtd$'/}
     lab_start "$1" mgmtd mgmtd --config $LAB_CONFIG
-    lab_wait_event 20 "$1" '^mgmtd ready' || lab_show_and_die "$1" "mgmtd of $1 does not start"
+    lab_wait_event 20 "$1" '^mgmtd ready' || lab_show_and_die "$1" "mgmtd of $1 did not start"
 }
 lab_wccpd_start() { # NODE
     local before
@@ -468,9 +470,9 @@ lab_wccpd_start() { # NODE
         lab_alive "$1" wccpd || break
         sleep 0.05
     done
-    lab_show_and_die "$1" "wccpd of $1 does not start"
+    lab_show_and_die "$1" "wccpd of $1 did not start"
 }
-lab_show() { # NODE : what it has said last
+lab_show() { # NODE : the last lines of its log and of the output of its programs
     tail -n 40 "$LAB/$1.log" "$LAB/$1"-*.out >&2
 }
 lab_show_and_die() { # NODE TEXT
@@ -489,7 +491,7 @@ lab_configure() { # NODE [TEXT]...
         [[ $now != *$LAB_CONFIG:* ]] || break
         sleep 0.05
     done
-    echo "lab: the configuration of $1 is refused: $now" >&2
+    echo "lab: mgmtd of $1 refused the configuration: $now" >&2
     return 1
 }
 
@@ -529,19 +531,25 @@ lab_manage() { # NODE WORDS...
     lab_in "$1" "$WCCP_BIN/mgmtctl" --json "${@:2}"
 }
 
-# {"51": {"oper": "ACTIVE, DESIGNATED", "router": {"1": {"state": ..., "appliance": {"10.0.0.101": {"load_dist": 100}}}},
-# "appliance": {"1": {"ipaddr": ..., "weight": ...}}, ...}}: nodes by the parts of their names.
-lab_state() { # NODE [GROUP]
-    lab_manage "$1" walk "/qv/wccpd/wccp/srv_grp/state${2:+/$2}" 2>/dev/null | jq -c --arg group "${2-}" '
+# Prints the nodes below a name as nested objects: /a/b/c/d below /a/b is {"c": {"d": VALUE}}.
+lab_tree() { # NODE NAME
+    lab_manage "$1" walk "$2" 2>/dev/null | jq -c --arg name "${2%/}" '
         (arrays // []) |
         (reduce (.[].name | split("/") | range(1; length) as $depth | .[:$depth] | join("/")) as $above ({}; .[$above] = true)) as $parents |
         map(select($parents[.name] | not)) |
-        reduce .[] as $node ({}; setpath($node.name | split("/")[6:]; $node.value)) |
-        if $group == "" then . else .[$group] | objects // {} end'
+        reduce .[] as $node ({}; setpath($node.name | split("/")[($name | split("/") | length):]; $node.value)) | objects // {}'
+}
+# {"51": {"oper": "ACTIVE, DESIGNATED", "router": {"1": {"state": ..., "appliance": {"10.0.0.101": {"load_dist": 100}}}},
+# "appliance": {"1": {"ipaddr": ..., "weight": ...}}, ...}}
+lab_state() { # NODE [GROUP]
+    lab_tree "$1" "/qv/wccpd/wccp/srv_grp/state${2:+/$2}"
+}
+lab_tunneld_state() { # NODE KIND
+    lab_tree "$1" "/qv/tunneld/$2/state"
 }
 
-# What would be left behind in an appliance: processes, shared memory and semaphores, sockets, interfaces, files. The
-# registry of shared memory with its semaphore and the tunnel mailbox stay by design, with nobody attached, and so does
+# Prints what is left in an appliance: processes, shared memory, semaphores, sockets, interfaces, files. Left out is what
+# stays by design: the registry of shared memory with its semaphore, the tunnel mailbox if no process has it attached, and
 # the pid file.
 lab_remains() { # NODE
     lab_in "$1" bash -c '
@@ -567,40 +575,40 @@ lab_end() { # NODE...
             [ -n "${LAB_PID[$node/$name]-}" ] || continue
             lab_alive "$node" $name || continue
             lab_stop "$node" $name; status=$?
-            [ $status = 0 ] || { echo "lab: $name of $node ended with $status" >&2; lab_show "$node"; return 1; }
+            [ $status = 0 ] || { echo "lab: $name of $node exited with $status" >&2; lab_show "$node"; return 1; }
         done
         now=$(lab_remains "$node" | grep -vE "^\$${LAB_KILLED[$node]-}")
         [ "$now" = "${LAB_FOUND[$node]-}" ] ||
-            { echo "lab: not the same is left in $node:"; diff <(echo "${LAB_FOUND[$node]-}") <(echo "$now"); return 1; } >&2
+            { echo "lab: before the start (<) and after the end (>) of $node:"; diff <(echo "${LAB_FOUND[$node]-}") <(echo "$now"); return 1; } >&2
     done
 }
 
-# A line of the log begins with facility and level: eight times the one and the other.
+# A log line begins with <N>: 8 times the facility, plus the level.
 lab_clean_log() { # NODE [EXPRESSION...]
     local node=$1 allowed bad; shift
     allowed=$(IFS='|'; echo "$*")
     bad=$(grep -E '^<([0-9]*[02468])?[0-9]>' "$LAB/$node.log" | awk -F'[<>]' '$2 % 8 <= 3' | grep -vE -- "${allowed:-^$}")
     bad+=$(grep -hE 'Sanitizer|runtime error:' "$LAB/$node"-*.out)
-    [ -z "$bad" ] || { printf 'lab: %s says:\n%s\n' "$node" "$bad" >&2; return 1; }
+    [ -z "$bad" ] || { printf 'lab: errors in the log of %s:\n%s\n' "$node" "$bad" >&2; return 1; }
 }
 
-# Writes what passes the bridge to a file until the lab ends or lab_capture_end. tcpdump wants to change its user and
-# groups, which a user namespace of an ordinary user refuses: dumpcap, which comes with tshark, does it there.
+# Captures WCCP and GRE packets on the bridge to a file, until lab_capture_end or the end of the lab. Where an ordinary
+# user's namespace does not let tcpdump change its user and groups, dumpcap from tshark is used.
 lab_capture() { # FILE
-    local with=(tcpdump -i lan --immediate-mode -U -Z root -w "$1" udp port 2048 or ip proto 47) said='listening on'
+    local with=(tcpdump -i lan --immediate-mode -U -Z root -w "$1" udp port 2048 or ip proto 47) ready='listening on'
     if [ "$(cat /proc/self/setgroups)" = deny ]; then
-        with=(dumpcap -q -P -i lan -f 'udp port 2048 or ip proto 47' -w "$1") said='Capturing on'
+        with=(dumpcap -q -P -i lan -f 'udp port 2048 or ip proto 47' -w "$1") ready='Capturing on'
     fi
     "${with[@]}" </dev/null >"$LAB/capture.out" 2>&1 &
     LAB_CAPTURE=$!
-    lab_wait_line 20 "$said" "$LAB/capture.out" || { cat "$LAB/capture.out" >&2; return 1; }
+    lab_wait_line 20 "$ready" "$LAB/capture.out" || { cat "$LAB/capture.out" >&2; return 1; }
 }
 lab_capture_end() {
     sleep 1.2
     kill -INT "$LAB_CAPTURE"; wait "$LAB_CAPTURE"
 }
 
-# ---- as a command
+# --- As a command
 
 if [ "${BASH_SOURCE[0]}" = "$0" ]; then
     lab_enter "$0" "$@"

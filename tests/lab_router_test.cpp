@@ -1,6 +1,6 @@
-// What the scenarios rely on when they judge wccpd by the lab's router: it takes in nothing that is stale,
-// cut or signed otherwise, its view has the bytes of what it adopted, and it sends each packet to the owner
-// of its bucket. The rest is for the scenarios.
+// The properties of the simulated router on which scenarios rely when they test wccpd: it refuses messages
+// that are stale, cut or wrongly signed, its view has the assignment that it adopted, byte by byte, and it
+// sends each packet to the owner of its bucket.
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -9,11 +9,13 @@
 
 using namespace lab;
 
+namespace {
+
 constexpr address ROUTER = 0x0a000001; // 10.0.0.1
 constexpr address LOW = 0x0a000065;    // 10.0.0.101
 constexpr address HIGH = 0x0a000066;   // 10.0.0.102
 
-static bytes hex(const std::string &text) {
+bytes hex(const std::string &text) {
     bytes out;
     std::string digits;
     std::copy_if(text.begin(), text.end(), std::back_inserter(digits), [](char c) { return c != ' '; });
@@ -21,26 +23,26 @@ static bytes hex(const std::string &text) {
         out.push_back(static_cast<uint8_t>(std::stoi(digits.substr(i, 2), nullptr, 16)));
     return out;
 }
-static std::string word(uint32_t value) {
+std::string word(uint32_t value) {
     char text[9];
     snprintf(text, sizeof text, "%08x", value);
     return text;
 }
-static std::string zeros(size_t count) {
+std::string zeros(size_t count) {
     return std::string(2 * count, '0');
 }
-static bytes message(uint32_t type, const std::string &components) {
+bytes message(uint32_t type, const std::string &components) {
     bytes body = hex(components);
     bytes out = hex(word(type) + "0200" + word(static_cast<uint32_t>(body.size())).substr(4));
     out.insert(out.end(), body.begin(), body.end());
     return out;
 }
 // No security; dynamic service 51, priority 5, protocol 6 (TCP), hash on the destination address.
-static const std::string PLAIN = "0000 0004 00000000";
-static const std::string SERVICE_51 = "0001 0018 01 33 05 06 00000002 00000000000000000000000000000000";
+const std::string PLAIN = "0000 0004 00000000";
+const std::string SERVICE_51 = "0001 0018 01 33 05 06 00000002 00000000000000000000000000000000";
 
 // Receive id 0: the router is not in the view of the message.
-static bytes hello(address id, uint16_t weight, uint32_t receive_id) {
+bytes hello(address id, uint16_t weight, uint32_t receive_id) {
     const std::string identity =
         "0003 002c" + word(id) + "0000 0000" + zeros(32) + word(weight).substr(4) + "0000";
     const std::string view = receive_id == 0
@@ -48,8 +50,8 @@ static bytes hello(address id, uint16_t weight, uint32_t receive_id) {
                                  : "0005 0014 00000001 00000001 0a000001" + word(receive_id) + "00000000";
     return message(10, PLAIN + SERVICE_51 + identity + view);
 }
-// The first 100 buckets to the first of two appliances.
-static bytes hash_assignment(address key, uint32_t receive_id, uint32_t change_number) {
+// Two appliances: 100 buckets for the first, 156 for the second.
+bytes hash_assignment(address key, uint32_t receive_id, uint32_t change_number) {
     std::string buckets;
     for (int i = 0; i < 256; i++)
         buckets += i < 100 ? "00" : "01";
@@ -101,8 +103,7 @@ TEST(LabRouter, EchoesTheHashAssignmentItAdopted) {
     lab.send(LOW, hash_assignment(LOW, newest(), change));
     EXPECT_EQ(lab.result(), "adopted again");
     const bytes answer = lab.send(LOW, hello(LOW, 100, newest()));
-    // After header, security, service and identity with two addresses: the view, its key and the owners'
-    // bits.
+    // The view follows header, security, service and an identity with two addresses.
     const bytes view(answer.begin() + 44 + 28, answer.end());
     const bytes wanted =
         hex("0004 0070" + word(change) + "0a000065 00000001 00000001 0a000001 00000002" +
@@ -111,7 +112,7 @@ TEST(LabRouter, EchoesTheHashAssignmentItAdopted) {
     EXPECT_EQ(bytes(view.begin(), view.begin() + 0x74), wanted);
 }
 
-TEST(LabRouter, RefusesWhatDoesNotFit) {
+TEST(LabRouter, RefusesMalformedMessages) {
     bench lab;
     bytes good = hello(LOW, 100, 0);
     const auto refused = [&](bytes data) {
@@ -126,9 +127,9 @@ TEST(LabRouter, RefusesWhatDoesNotFit) {
         bad[place] ^= 0x10;
         EXPECT_TRUE(refused(bad)) << place;
     }
-    bytes liar = hash_assignment(LOW, 1, 1);
-    liar[liar.size() - 1] = 2; // a third appliance, of two
-    EXPECT_TRUE(refused(liar));
+    bytes third = hash_assignment(LOW, 1, 1);
+    third[third.size() - 1] = 2; // a bucket of a third appliance, of two
+    EXPECT_TRUE(refused(third));
     EXPECT_TRUE(lab.self.groups.empty());
 }
 
@@ -140,24 +141,24 @@ TEST(LabRouter, SignsAndChecks) {
                         zeros(32) + "0064 0000 0005 000c 00000001 00000000 00000000");
     lab.send(LOW, signed_hello);
     EXPECT_EQ(lab.result(), "refused: wrong digest");
-    // md5sum of "secret\0\0" and the message above with an empty digest
+    // Computed with md5sum: "secret\0\0" and the message with a digest of zeros.
     const bytes digest = hex("bc76b5520d4b344b2f9ce814b8dbb9f3");
     std::copy(digest.begin(), digest.end(), signed_hello.begin() + 16);
     const bytes answer = lab.send(LOW, signed_hello);
     ASSERT_FALSE(answer.empty()) << lab.result();
     bytes copy = answer;
-    sign(&copy, "secret");
+    sign_message(&copy, "secret");
     EXPECT_EQ(copy, answer);
-    sign(&copy, "Secret");
+    sign_message(&copy, "Secret");
     EXPECT_NE(copy, answer);
     lab.send(LOW, hello(LOW, 100, 0));
     EXPECT_EQ(lab.result(), "refused: not signed");
 }
 
-// ---- the data path
+// --- The data path
 
 // IPv4 with the first bytes of TCP.
-static bytes packet(const std::string &src, const std::string &dst, const std::string &ports) {
+bytes packet(const std::string &src, const std::string &dst, const std::string &ports) {
     return hex("4500 002c 0001 4000 40 06 0000" + src + dst + ports + zeros(20));
 }
 
@@ -183,7 +184,7 @@ TEST(LabRouter, FindsTheOwnerOfAPacket) {
     EXPECT_NEAR(owners[LOW], 200, 60); // 100 buckets of 256
     EXPECT_EQ(owners[LOW] + owners[HIGH], 512);
 
-    // Both directions to one appliance: the other service hashes what is the source on the way back.
+    // Both directions go to the same appliance: the other service hashes the source address.
     group &back = lab.self.groups[52] = lab.in();
     back.service.id = 52;
     back.service.flags = 1;
@@ -197,11 +198,11 @@ TEST(LabRouter, FindsTheOwnerOfAPacket) {
 
     const verdict found = ask(web);
     EXPECT_EQ(gre_header(lab.self, found), hex("0000 883e 80 33 00" + word(found.bucket).substr(6)));
-    lab.self.options.gre_form = "plain";
+    lab.self.options.gre_format = "plain";
     EXPECT_EQ(gre_header(lab.self, found), hex("0000 883e"));
-    lab.self.options.gre_form = "ip";
+    lab.self.options.gre_format = "ip";
     EXPECT_EQ(gre_header(lab.self, found), hex("0000 0800"));
-    const auto begins = [](const bytes &gre) { return carried_at(gre.data(), gre.size()); };
+    const auto begins = [](const bytes &gre) { return inner_offset(gre.data(), gre.size()); };
     EXPECT_EQ(begins(hex("0000 0800 45000014")), 4u);
     EXPECT_EQ(begins(hex("0000 883e 45000014")), 4u);
     EXPECT_EQ(begins(hex("0000 883e 80330007 45000014")), 8u);
@@ -217,10 +218,12 @@ TEST(LabRouter, FindsTheOwnerOfAPacket) {
     EXPECT_EQ(ask(packet("0a010080", "0a020002", "c0000051")).owner, 0u);
 
     packet_fields fields;
-    for (const size_t place : {0u, 3u}) { // a version, a length that are not there
+    for (const size_t place : {0u, 3u}) { // version, total length
         bytes bad = web;
         bad[place] = 0x2f;
         EXPECT_FALSE(read_packet(bad.data(), bad.size(), &fields)) << place;
     }
     EXPECT_FALSE(read_packet(web.data(), 43, &fields));
 }
+
+} // namespace

@@ -1,4 +1,4 @@
-// The commands that a running router takes, one row each: its words, and what they do to the machine.
+// The commands of a running router, one row each.
 #include "lab/router/router.h"
 
 #include <algorithm>
@@ -10,21 +10,24 @@ const char *const ROUTER_COMMANDS =
     "[@ROUTER] COMMAND...   for one router, or for all\n"
     "  show                       the whole state, as JSON\n"
     "  owners SERVICE             owner of each bucket or value, on one line\n"
-    "  members SERVICE            address, weight, share, seconds of silence, asked (0 or 1) of each "
-    "appliance, on lines\n"
-    "  stop | resume              say and hear nothing | go on\n"
-    "  ignore ADDRESS | heed ADDRESS     hear nothing of one appliance\n"
+    "  members SERVICE            a line for each appliance: address, weight, share, seconds since its last "
+    "Here-I-Am, queried (0 or 1)\n"
+    "  stop | resume              send nothing and ignore everything | continue\n"
+    "  ignore ADDRESS | heed ADDRESS     ignore the messages of one appliance | accept them again\n"
     "  forget ADDRESS             drop an appliance at once\n"
     "  query ADDRESS              send a Removal Query\n"
-    "  assign SERVICE FIRST LAST ADDRESS|none   give these buckets or values to another\n"
-    "  list ROUTER | unlist ROUTER       report a router that is not there\n"
-    "  offer FORWARD ASSIGN RETURN       words as on the command line\n"
-    "  nexus | ios                the form of its views\n"
-    "  password [TEXT]            of its messages; none without a text\n"
-    "  fault NAME [TIMES|always]  spoil the next I-See-You messages; fault none\n"
-    "  raw HEX [ADDRESS]          send these bytes, to all appliances or to one\n"
-    "  traffic [reset]            what was redirected to each appliance, as JSON; counted anew from now on\n"
-    "  gre redirect|plain|ip      redirected packets: with redirect header, without it, as type 0x0800\n";
+    "  assign SERVICE FIRST LAST ADDRESS|none   change the owner of these buckets or values\n"
+    "  list ROUTER | unlist ROUTER       report a router that does not exist\n"
+    "  offer FORWARD ASSIGN RETURN       change the offered methods, words as on the command line\n"
+    "  nexus | ios                change the format of the views\n"
+    "  password [TEXT]            change the password of its messages, or remove it\n"
+    "  fault NAME [TIMES|always]  spoil the next I-See-You messages; fault none: stop that\n"
+    "  raw HEX [ADDRESS]          send these bytes to all appliances or to one\n"
+    "  traffic [reset]            show counters of redirected traffic as JSON; reset them\n"
+    "  gre redirect|plain|ip      format of redirected packets: with redirect header, without it, type "
+    "0x0800\n";
+
+namespace {
 
 struct command_call {
     router *self;
@@ -33,11 +36,10 @@ struct command_call {
     output *out;
 };
 
-static const std::string BAD_ADDRESS = "error: that is no address";
+const std::string BAD_ADDRESS = "error: not an address";
 
-// For each group that knows the appliance of the first argument.
-static std::string for_appliance(const command_call &call,
-                                 void (*act)(const command_call &, group *, address)) {
+// Calls `act` for each group that has the appliance of the first argument.
+std::string for_appliance(const command_call &call, void (*act)(const command_call &, group *, address)) {
     const auto id = address_of(call.words[1]);
     if (!id)
         return BAD_ADDRESS;
@@ -51,36 +53,36 @@ static std::string for_appliance(const command_call &call,
     return found ? "ok" : "error: no such appliance";
 }
 
-static std::string do_forget(const command_call &call) {
+std::string do_forget(const command_call &call) {
     return for_appliance(call, [](const command_call &inner, group *in, address id) {
         drop_member(inner.self, in, id, inner.now, "forgotten", inner.out);
     });
 }
 
-static std::string do_query(const command_call &call) {
+std::string do_query(const command_call &call) {
     return for_appliance(call, [](const command_call &inner, group *in, address id) {
         send_query(inner.self, in, &in->members[id], inner.now, inner.out);
-        in->members[id].queried = false; // one more comes when its time has come
+        in->members[id].queried = false; // the regular query is still sent
     });
 }
 
-static std::string do_deaf(const command_call &call) {
+std::string do_ignore(const command_call &call) {
     const auto id = address_of(call.words[1]);
     if (!id)
         return BAD_ADDRESS;
     if (call.words[0] == "ignore")
-        call.self->deaf_to.insert(*id);
+        call.self->ignored.insert(*id);
     else
-        call.self->deaf_to.erase(*id);
+        call.self->ignored.erase(*id);
     return "ok";
 }
 
-static std::string do_stop(const command_call &call) {
+std::string do_stop(const command_call &call) {
     call.self->stopped = call.words[0] == "stop";
     return "ok";
 }
 
-static std::string do_list(const command_call &call) {
+std::string do_list(const command_call &call) {
     const auto id = address_of(call.words[1]);
     if (!id)
         return BAD_ADDRESS;
@@ -94,17 +96,17 @@ static std::string do_list(const command_call &call) {
     return "ok";
 }
 
-static std::string do_form(const command_call &call) {
+std::string do_format(const command_call &call) {
     call.self->options.nexus = call.words[0] == "nexus";
     return "ok";
 }
 
-static std::string do_password(const command_call &call) {
+std::string do_password(const command_call &call) {
     call.self->options.password = call.words.size() > 1 ? call.words[1] : "";
     return "ok";
 }
 
-static std::optional<uint32_t> number_of(const std::string &text) {
+std::optional<uint32_t> number_of(const std::string &text) {
     uint32_t value = 0;
     const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
     if (error != std::errc() || end != text.data() + text.size())
@@ -112,7 +114,7 @@ static std::optional<uint32_t> number_of(const std::string &text) {
     return value;
 }
 
-static group *find_group(const command_call &call) {
+group *find_group(const command_call &call) {
     const auto id = number_of(call.words[1]);
     if (!id || *id > 255)
         return nullptr;
@@ -120,7 +122,7 @@ static group *find_group(const command_call &call) {
     return place == call.self->groups.end() ? nullptr : &place->second;
 }
 
-static std::vector<address *> owners_of(group *in) {
+std::vector<address *> owners_of(group *in) {
     std::vector<address *> owners;
     if (in->current.by == kind::hash)
         for (address &owner : in->current.buckets)
@@ -131,7 +133,7 @@ static std::vector<address *> owners_of(group *in) {
     return owners;
 }
 
-static std::string do_owners(const command_call &call) {
+std::string do_owners(const command_call &call) {
     group *in = find_group(call);
     if (!in)
         return "none";
@@ -143,7 +145,7 @@ static std::string do_owners(const command_call &call) {
     return line;
 }
 
-static std::string do_members(const command_call &call) {
+std::string do_members(const command_call &call) {
     group *in = find_group(call);
     std::string lines;
     if (!in)
@@ -160,7 +162,7 @@ static std::string do_members(const command_call &call) {
     return lines;
 }
 
-static std::string do_assign(const command_call &call) {
+std::string do_assign(const command_call &call) {
     group *in = find_group(call);
     const auto first = number_of(call.words[2]), last = number_of(call.words[3]);
     const auto owner = call.words[4] == "none" ? std::optional<address>(0) : address_of(call.words[4]);
@@ -168,13 +170,13 @@ static std::string do_assign(const command_call &call) {
         return "error: assign SERVICE FIRST LAST ADDRESS";
     const auto owners = owners_of(in);
     if (*first > *last || *last >= owners.size())
-        return "error: there are " + std::to_string(owners.size()) + " to assign";
+        return "error: there are " + std::to_string(owners.size()) + " buckets or values";
     for (uint32_t i = *first; i <= *last; i++)
         *owners[i] = *owner;
     return "ok";
 }
 
-static std::string do_offer(const command_call &call) {
+std::string do_offer(const command_call &call) {
     methods offer = {0, 0, 0};
     uint32_t *const sets[] = {&offer.forward, &offer.assign, &offer.giveback};
     for (size_t i = 0; i < 3; i++) {
@@ -189,7 +191,7 @@ static std::string do_offer(const command_call &call) {
     return "ok";
 }
 
-static std::string do_fault(const command_call &call) {
+std::string do_fault(const command_call &call) {
     const std::string &name = call.words[1];
     if (name == "none") {
         call.self->fault_left = 0;
@@ -200,21 +202,21 @@ static std::string do_fault(const command_call &call) {
     const std::string times = call.words.size() > 2 ? call.words[2] : "1";
     const auto number = number_of(times);
     if (times != "always" && (!number || *number > 1000000))
-        return "error: how often?";
+        return "error: not a number of times";
     call.self->fault = name;
     call.self->fault_left = times == "always" ? -1 : static_cast<int>(*number);
     return "ok";
 }
 
-static std::string do_raw(const command_call &call) {
+std::string do_raw(const command_call &call) {
     bytes data;
     const std::string &hex = call.words[1];
     if (hex.size() % 2 != 0)
-        return "error: that is no hex";
+        return "error: not hexadecimal";
     for (size_t i = 0; i < hex.size(); i += 2) {
         uint8_t value = 0;
         if (std::from_chars(&hex[i], &hex[i] + 2, value, 16).ptr != &hex[i] + 2)
-            return "error: that is no hex";
+            return "error: not hexadecimal";
         data.push_back(value);
     }
     std::set<address> to;
@@ -233,11 +235,11 @@ static std::string do_raw(const command_call &call) {
     return "ok";
 }
 
-static std::string do_show(const command_call &call) {
+std::string do_show(const command_call &call) {
     return router_state(*call.self, call.now).dump();
 }
 
-static std::string do_traffic(const command_call &call) {
+std::string do_traffic(const command_call &call) {
     if (call.words.size() == 1)
         return traffic_state(*call.self).dump();
     if (call.words[1] != "reset")
@@ -246,39 +248,41 @@ static std::string do_traffic(const command_call &call) {
     return "ok";
 }
 
-static std::string do_gre(const command_call &call) {
-    if (std::find(std::begin(gre_forms), std::end(gre_forms), call.words[1]) == std::end(gre_forms))
+std::string do_gre(const command_call &call) {
+    if (std::find(std::begin(gre_formats), std::end(gre_formats), call.words[1]) == std::end(gre_formats))
         return "error: gre redirect|plain|ip";
-    call.self->options.gre_form = call.words[1];
+    call.self->options.gre_format = call.words[1];
     return "ok";
 }
 
 struct command_row {
     const char *name;
-    size_t least, most; // words with the name
+    size_t least, most; // words, including the name
     std::string (*act)(const command_call &call);
 };
 constexpr command_row COMMANDS[] = {
     {"show", 1, 1, do_show},         {"owners", 2, 2, do_owners}, {"members", 2, 2, do_members},
-    {"stop", 1, 1, do_stop},         {"resume", 1, 1, do_stop},   {"ignore", 2, 2, do_deaf},
-    {"heed", 2, 2, do_deaf},         {"forget", 2, 2, do_forget}, {"query", 2, 2, do_query},
+    {"stop", 1, 1, do_stop},         {"resume", 1, 1, do_stop},   {"ignore", 2, 2, do_ignore},
+    {"heed", 2, 2, do_ignore},       {"forget", 2, 2, do_forget}, {"query", 2, 2, do_query},
     {"assign", 5, 5, do_assign},     {"list", 2, 2, do_list},     {"unlist", 2, 2, do_list},
-    {"offer", 4, 4, do_offer},       {"nexus", 1, 1, do_form},    {"ios", 1, 1, do_form},
+    {"offer", 4, 4, do_offer},       {"nexus", 1, 1, do_format},  {"ios", 1, 1, do_format},
     {"password", 1, 2, do_password}, {"fault", 2, 3, do_fault},   {"raw", 2, 3, do_raw},
     {"traffic", 1, 2, do_traffic},   {"gre", 2, 2, do_gre},
 };
 
+} // namespace
+
 std::string router_command(router *self, double now, const std::vector<std::string> &words, output *out) {
     if (words.empty())
-        return "error: nothing to do";
+        return "error: no command";
     for (const command_row &row : COMMANDS) {
         if (words[0] != row.name)
             continue;
         if (words.size() < row.least || words.size() > row.most)
-            return "error: too few or too many words";
+            return "error: too few or too many arguments";
         return row.act({self, now, words, out});
     }
-    return std::string("error: no such command\n") + ROUTER_COMMANDS;
+    return std::string("error: unknown command\n") + ROUTER_COMMANDS;
 }
 
 } // namespace lab

@@ -1,7 +1,8 @@
-// Ways in which a router's message can be wrong, one row each: some in what it says, some in its bytes.
+// The faults that a router's message can have, one row each: in its contents or in its bytes.
 #include "lab/router/router.h"
 
 namespace lab {
+namespace {
 
 constexpr uint16_t UNKNOWN_COMPONENT = 77;
 
@@ -11,12 +12,12 @@ struct fault {
     void (*data)(bytes *data, std::string_view password);
 };
 
-static void add_unknown(i_see_you *message, int times) {
+void add_unknown(i_see_you *message, int times) {
     for (int i = 0; i < times; i++)
         message->extra.emplace_back(UNKNOWN_COMPONENT, bytes(4, 0));
 }
 
-static void set_length(bytes *data, size_t length) {
+void set_length(bytes *data, size_t length) {
     (*data)[6] = static_cast<uint8_t>(length >> 8);
     (*data)[7] = static_cast<uint8_t>(length & 0xff);
 }
@@ -32,18 +33,18 @@ constexpr fault FAULTS[] = {
     {"bad-length", nullptr,
      [](bytes *data, std::string_view password) {
          set_length(data, data->size() - 8 + 1);
-         sign(data, password);
+         sign_message(data, password);
      }},
     {"cut", nullptr,
      [](bytes *data, std::string_view password) {
          data->resize(data->size() - 6);
          set_length(data, data->size() - 8);
-         sign(data, password);
+         sign_message(data, password);
      }},
     {"bad-version", nullptr,
      [](bytes *data, std::string_view password) {
          (*data)[4] = 1;
-         sign(data, password);
+         sign_message(data, password);
      }},
     {"odd-component",
      [](i_see_you *message, std::string *) { message->extra.emplace_back(UNKNOWN_COMPONENT, bytes(3, 0)); },
@@ -79,7 +80,7 @@ constexpr fault FAULTS[] = {
              element.revision = 1;
      },
      nullptr},
-    {"other-form",
+    {"other-format",
      [](i_see_you *message, std::string *) {
          for (view_element &element : message->appliances)
              element.is_short = element.flags == 2 && !element.is_short;
@@ -89,7 +90,7 @@ constexpr fault FAULTS[] = {
     {"huge-map",
      [](i_see_you *message, std::string *) {
          message->map.clear();
-         // one mask with 2^28 values
+         // one mask that announces 2^28 values
          bytes map = {0, 0, 0, 1};
          map.resize(16);
          map.insert(map.end(), {0x10, 0, 0, 0});
@@ -105,12 +106,14 @@ constexpr fault FAULTS[] = {
      nullptr},
 };
 
-static const fault *find_fault(const std::string &name) {
+const fault *find_fault(const std::string &name) {
     for (const fault &row : FAULTS)
         if (name == row.name)
             return &row;
     return nullptr;
 }
+
+} // namespace
 
 bool is_fault(const std::string &name) {
     return find_fault(name) != nullptr;

@@ -21,14 +21,15 @@
 #include "runtime/ttime.h"
 
 namespace lab {
+namespace {
 
 constexpr size_t LINK_BYTES = 1500;
 constexpr size_t OUTER_BYTES = 20;
-constexpr int AT_ONCE = 64; // packets of one descriptor before the others have their turn
+constexpr int AT_ONCE = 64; // packets from one descriptor before the others are read
 enum : uint8_t { TCP = 6, UDP = 17 };
 enum : uint16_t { GRE_IPV4 = 0x0800, GRE_REDIRECTED = 0x883e };
 enum : uint8_t { METHOD_GRE = 1, METHOD_L2 = 2 };
-// Flags of a service: fields that are hashed, and what its ports mean.
+// Flags of a service: the fields that are hashed, and the meaning of its ports.
 enum : uint32_t {
     BY_SRC_IP = 1,
     BY_DST_IP = 2,
@@ -37,15 +38,17 @@ enum : uint32_t {
     HAS_PORTS = 16,
     PORTS_ARE_SOURCES = 32
 };
-constexpr uint8_t WELL_KNOWN_WEB = 0; // the one service whose port needs no saying
+constexpr uint8_t WELL_KNOWN_WEB = 0; // service id; it implies TCP port 80
 constexpr uint8_t DYNAMIC_SERVICE = 0x80;
 
-static uint16_t read_u16(const uint8_t *at) {
+uint16_t read_u16(const uint8_t *at) {
     return static_cast<uint16_t>(at[0] << 8 | at[1]);
 }
-static uint32_t read_u32(const uint8_t *at) {
+uint32_t read_u32(const uint8_t *at) {
     return static_cast<uint32_t>(read_u16(at)) << 16 | read_u16(at + 2);
 }
+
+} // namespace
 
 bool read_packet(const uint8_t *data, size_t size, packet_fields *fields) {
     if (size < 20 || data[0] >> 4 != 4)
@@ -63,9 +66,11 @@ bool read_packet(const uint8_t *data, size_t size, packet_fields *fields) {
     return true;
 }
 
-// ---- whose packet it is
+// --- Which appliance gets a packet
 
-static bool serves(const service_info &service, const packet_fields &packet) {
+namespace {
+
+bool matches_service(const service_info &service, const packet_fields &packet) {
     if (service.type == 0 && service.id == WELL_KNOWN_WEB)
         return packet.protocol == TCP && packet.dst_port == 80;
     if (service.protocol != 0 && service.protocol != packet.protocol)
@@ -76,9 +81,10 @@ static bool serves(const service_info &service, const packet_fields &packet) {
     return port != 0 && std::find(service.ports.begin(), service.ports.end(), port) != service.ports.end();
 }
 
-// One field alone gives the same bucket whichever field it is: a service that hashes sources and one that
-// hashes destinations send both directions of a flow to one appliance, when their tables are the same.
-static uint8_t bucket_of(const service_info &service, const packet_fields &packet) {
+// The bucket of a single field does not depend on which field it is: a service that hashes sources and one
+// that hashes destinations send both directions of a flow to the same appliance, if their tables are the
+// same.
+uint8_t bucket_of(const service_info &service, const packet_fields &packet) {
     const uint32_t flags =
         service.type == 0 && service.id == WELL_KNOWN_WEB ? uint32_t{BY_DST_IP} : service.flags;
     uint64_t mixed = 0;
@@ -93,7 +99,7 @@ static uint8_t bucket_of(const service_info &service, const packet_fields &packe
     return static_cast<uint8_t>(mixed >> 56);
 }
 
-static address owner_by_mask(const std::vector<mask_set> &sets, const packet_fields &packet) {
+address owner_by_mask(const std::vector<mask_set> &sets, const packet_fields &packet) {
     for (const mask_set &set : sets) {
         const mask_fields wanted = {packet.src & set.mask.src_ip, packet.dst & set.mask.dst_ip,
                                     static_cast<uint16_t>(packet.src_port & set.mask.src_port),
@@ -105,7 +111,7 @@ static address owner_by_mask(const std::vector<mask_set> &sets, const packet_fie
     return 0;
 }
 
-static verdict ask_group(const group &in, const packet_fields &packet) {
+verdict ask_group(const group &in, const packet_fields &packet) {
     verdict found;
     found.in = &in;
     if (in.current.by == kind::hash) {
@@ -122,17 +128,19 @@ static verdict ask_group(const group &in, const packet_fields &packet) {
     return found;
 }
 
+} // namespace
+
 verdict find_owner(const router &self, const std::set<uint8_t> &services, const packet_fields &packet) {
     const group *best = nullptr;
     for (const auto &[id, in] : self.groups)
         if (services.contains(id) && in.defined && in.current.by != kind::none &&
-            serves(in.service, packet) && (!best || in.service.priority > best->service.priority))
+            matches_service(in.service, packet) && (!best || in.service.priority > best->service.priority))
             best = &in;
     return best ? ask_group(*best, packet) : verdict{};
 }
 
 bytes gre_header(const router &self, const verdict &found) {
-    const std::string &form = self.options.gre_form;
+    const std::string &form = self.options.gre_format;
     if (form == "ip")
         return {0, 0, GRE_IPV4 >> 8, GRE_IPV4 & 0xff};
     bytes header = {0, 0, GRE_REDIRECTED >> 8, GRE_REDIRECTED & 0xff};
@@ -144,25 +152,27 @@ bytes gre_header(const router &self, const verdict &found) {
     return header;
 }
 
-size_t carried_at(const uint8_t *gre, size_t size) {
-    if (size < 8 || read_u16(gre) != 0) // an appliance has no use for keys, numbers and checksums
+size_t inner_offset(const uint8_t *gre, size_t size) {
+    if (size < 8 || read_u16(gre) != 0) // appliances use no keys, sequence numbers and checksums
         return 0;
     const uint16_t type = read_u16(gre + 2);
-    // The redirect header begins with flags, none of which make it look like version 4.
+    // The first four bits of a redirect header are never 4, the version of an inner packet without one.
     if (type == GRE_IPV4 || (type == GRE_REDIRECTED && gre[4] >> 4 == 4))
         return 4;
     return type == GRE_REDIRECTED ? 8 : 0;
 }
 
-// ---- the way there
+// --- Sockets and devices
 
-static int open_tun(const std::string &interface, std::string *wrong) {
+namespace {
+
+int open_tun(const std::string &interface, std::string *wrong) {
     const int fd = open("/dev/net/tun", O_RDWR | O_CLOEXEC | O_NONBLOCK);
     ifreq wish = {};
     snprintf(wish.ifr_name, sizeof wish.ifr_name, "to-%s", interface.c_str());
     wish.ifr_flags = IFF_TUN | IFF_NO_PI;
     const int control = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-    // It stays when the program ends, and the routes through it with it.
+    // The device, with the routes through it, outlives this program.
     if (fd < 0 || ioctl(fd, TUNSETIFF, &wish) != 0 || ioctl(fd, TUNSETPERSIST, 1) != 0 ||
         ioctl(control, SIOCGIFFLAGS, &wish) != 0 ||
         (wish.ifr_flags |= IFF_UP, ioctl(control, SIOCSIFFLAGS, &wish) != 0))
@@ -173,13 +183,13 @@ static int open_tun(const std::string &interface, std::string *wrong) {
     return fd;
 }
 
-static int open_gre(address own, std::string *wrong) {
+int open_gre(address own, std::string *wrong) {
     const int fd = socket(AF_INET, SOCK_RAW | SOCK_CLOEXEC | SOCK_NONBLOCK, IPPROTO_GRE);
     sockaddr_in place = {};
     place.sin_family = AF_INET;
     place.sin_addr.s_addr = htonl(own);
     const int fragments = IP_PMTUDISC_DONT, room = 8 << 20, one = 1;
-    // The interface that has the address may come later.
+    // The interface with the address may be created later.
     if (fd < 0 || setsockopt(fd, IPPROTO_IP, IP_FREEBIND, &one, sizeof one) != 0 ||
         bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0 ||
         setsockopt(fd, IPPROTO_IP, IP_MTU_DISCOVER, &fragments, sizeof fragments) != 0)
@@ -188,6 +198,8 @@ static int open_gre(address own, std::string *wrong) {
         (void)setsockopt(fd, SOL_SOCKET, which, &room, sizeof room);
     return fd;
 }
+
+} // namespace
 
 bool read_redirecting(const std::string &text, redirecting *out) {
     const size_t equals = text.find('=');
@@ -228,8 +240,12 @@ std::vector<int> forwarder_descriptors(const forwarder &path) {
     return all;
 }
 
-// Where the neighbour table has an appliance; looked up anew each second.
-static const sockaddr_ll *find_neighbour(address who) {
+// --- Forwarding
+
+namespace {
+
+// The link address of an appliance from the neighbour table, cached for a second.
+const sockaddr_ll *find_neighbour(address who) {
     static std::map<address, std::pair<int64_t, sockaddr_ll>> known;
     const int64_t now = lt_monotonic_ns();
     auto &[looked_up, place] = known[who];
@@ -259,7 +275,7 @@ static const sockaddr_ll *find_neighbour(address who) {
     return place.sll_halen ? &place : nullptr;
 }
 
-static bool send_by_gre(const forwarder &path, const verdict &found, const uint8_t *data, size_t size) {
+bool send_by_gre(const forwarder &path, const verdict &found, const uint8_t *data, size_t size) {
     bytes header = gre_header(*path.self, found);
     sockaddr_in place = {};
     place.sin_family = AF_INET;
@@ -275,13 +291,13 @@ static bool send_by_gre(const forwarder &path, const verdict &found, const uint8
     return sendmsg(path.source >= 0 ? path.source : path.raw, &message, 0) >= 0;
 }
 
-static bool send_by_l2(const forwarder &path, address owner, const uint8_t *data, size_t size) {
+bool send_by_l2(const forwarder &path, address owner, const uint8_t *data, size_t size) {
     const sockaddr_ll *place = find_neighbour(owner);
     return place &&
            sendto(path.link, data, size, 0, reinterpret_cast<const sockaddr *>(place), sizeof *place) >= 0;
 }
 
-static uint64_t flow_key(const packet_fields &packet, address owner) {
+uint64_t flow_key(const packet_fields &packet, address owner) {
     uint64_t key = owner;
     for (const uint32_t word : {packet.src, packet.dst, uint32_t{packet.src_port} << 16 | packet.dst_port,
                                 uint32_t{packet.protocol}})
@@ -289,8 +305,7 @@ static uint64_t flow_key(const packet_fields &packet, address owner) {
     return key;
 }
 
-static void redirect_packet(const forwarder &path, const redirecting &from, const uint8_t *data,
-                            size_t size) {
+void redirect_packet(const forwarder &path, const redirecting &from, const uint8_t *data, size_t size) {
     traffic &counted = path.self->traffic;
     packet_fields packet;
     const bool sound = read_packet(data, size, &packet);
@@ -314,12 +329,12 @@ static void redirect_packet(const forwarder &path, const redirecting &from, cons
         one.flows++;
 }
 
-static bool is_member(const router &self, address who) {
+bool is_member(const router &self, address who) {
     return std::any_of(self.groups.begin(), self.groups.end(),
                        [who](const auto &entry) { return entry.second.members.contains(who); });
 }
 
-static void take_back(const forwarder &path, const uint8_t *data, size_t size) {
+void accept_return(const forwarder &path, const uint8_t *data, size_t size) {
     traffic &counted = path.self->traffic;
     packet_fields outer, inner;
     const size_t header = size > 0 ? 4U * (data[0] & 15) : 0;
@@ -328,7 +343,7 @@ static void take_back(const forwarder &path, const uint8_t *data, size_t size) {
         return;
     }
     const uint8_t *gre = data + header;
-    const size_t rest = outer.length - header, begins = carried_at(gre, rest);
+    const size_t rest = outer.length - header, begins = inner_offset(gre, rest);
     if (begins == 0 || !read_packet(gre + begins, rest - begins, &inner)) {
         counted.refused_returns++;
         return;
@@ -339,6 +354,8 @@ static void take_back(const forwarder &path, const uint8_t *data, size_t size) {
         one.returned_redirected++;
     (void)write(path.from.front().tun, gre + begins, inner.length);
 }
+
+} // namespace
 
 void forward_packets(forwarder *path, int descriptor) {
     uint8_t data[65536];
@@ -351,7 +368,7 @@ void forward_packets(forwarder *path, int descriptor) {
         if (from != path->from.end())
             redirect_packet(*path, *from, data, static_cast<size_t>(got));
         else
-            take_back(*path, data, static_cast<size_t>(got));
+            accept_return(*path, data, static_cast<size_t>(got));
     }
 }
 

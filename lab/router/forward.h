@@ -1,10 +1,10 @@
-// The router's data path: what arrives on an interface that redirects is sent to the appliance that owns its
-// bucket, and what appliances return is routed on.
+// The router's data path: sends packets that arrive on a redirecting interface to the appliance that owns
+// their bucket, and routes packets that appliances return.
 //
-// Each redirecting interface NAME has a TUN device "to-NAME", into which the lab's routing rules send all
-// that the router would forward from there. What is not redirected is written back into the device, and the
-// kernel routes it: it has then come in by another interface, to which the rules do not apply. What
-// appliances return in GRE takes the same way. What they return by L2 the kernel routes alone.
+// Each redirecting interface NAME has a TUN device "to-NAME". The lab's routing rules send into it all
+// packets from NAME that the router would forward. Packets that are not redirected are written back into the
+// device, and the kernel routes them, because the rules do not apply to packets from to-NAME. So are packets
+// that appliances return in GRE. Packets returned by L2 are routed by the kernel directly.
 #pragma once
 
 #include <string>
@@ -14,28 +14,28 @@
 
 namespace lab {
 
-// What the header of an IPv4 packet says; ports are 0 in all but first fragments.
+// Header fields of an IPv4 packet. Ports are 0 without TCP or UDP, and in fragments other than the first.
 struct packet_fields {
     address src = 0, dst = 0;
     uint16_t src_port = 0, dst_port = 0;
     uint8_t protocol = 0;
-    size_t length = 0; // total, of the header
+    size_t length = 0; // total length, from the header
 };
 bool read_packet(const uint8_t *data, size_t size, packet_fields *fields);
 
 struct verdict {
-    address owner = 0; // of the bucket or value, 0: the packet is routed
+    address owner = 0; // of the bucket or value, 0: route the packet
     const group *in = nullptr;
-    uint8_t bucket = 0;  // 0 when assigned by mask
+    uint8_t bucket = 0;  // 0 if assigned by mask
     uint32_t method = 0; // 1 GRE, 2 L2
 };
-// The matching service of highest priority decides; a group without a table leaves the packet to the others.
+// The matching service with the highest priority decides. Groups without a table are skipped.
 verdict find_owner(const router &self, const std::set<uint8_t> &services, const packet_fields &packet);
-// The GRE header with the redirect header, as the options say.
+// The GRE header, and the redirect header in the format "redirect".
 bytes gre_header(const router &self, const verdict &found);
-// Where the carried packet begins in GRE from an appliance, without the outer IP header; 0 when it is
+// The offset of the inner packet in GRE from an appliance (which begins after the outer IP header); 0:
 // refused.
-size_t carried_at(const uint8_t *gre, size_t size);
+size_t inner_offset(const uint8_t *gre, size_t size);
 
 struct redirecting {
     std::string interface;
@@ -49,11 +49,11 @@ struct forwarder {
     int source = -1; // GRE from another address
     int link = -1;   // L2
 };
-// "eth0=51,52"; false when it makes no sense.
+// Parses "eth0=51,52"; false if it is invalid.
 bool read_redirecting(const std::string &text, redirecting *out);
-// "" or what went wrong.
+// Returns "" or an error message.
 std::string open_forwarder(forwarder *path);
-// Descriptors to poll, and what to do when one of them can be read.
+// The descriptors to poll; call forward_packets with each that is readable.
 std::vector<int> forwarder_descriptors(const forwarder &path);
 void forward_packets(forwarder *path, int descriptor);
 

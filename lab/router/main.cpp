@@ -1,9 +1,9 @@
-// wccp_router: one or many simulated routers, each on an address of its own.
+// wccp_router: one or more simulated routers, each on an address of its own, and small programs for the lab
+// as subcommands.
 //
-// This file has the sockets, the clock and the operator's words; what a router does is in router.cpp. One
-// thread, one poll: a socket bound to each router's address, one more per router for the multicast address,
-// the control socket, standard input, signals by descriptor, and the descriptors of the data path
-// (forward.cpp), when the router has one.
+// This file has the sockets, the clock and the command line; the router itself is in router.cpp. A single
+// thread polls a socket for each router's address, another for its multicast address, the control socket,
+// standard input, a signal descriptor, and the descriptors of the data path (forward.cpp) if there is one.
 #include <fcntl.h>
 #include <netinet/in.h>
 #include <poll.h>
@@ -29,6 +29,8 @@
 
 using namespace lab;
 
+namespace {
+
 constexpr uint16_t PORT = 2048;
 constexpr int TICK_MS = 200;
 
@@ -39,40 +41,40 @@ struct station {
 };
 struct lab_process {
     std::vector<station> stations;
-    forwarder path; // of the one router, when there is one
+    forwarder path; // in use only with a single router
     bool as_json = false;
     double began = 0;
 };
 
-static double seconds_now() {
+double seconds_now() {
     return static_cast<double>(lt_monotonic_ns()) / 1e9;
 }
 
-static sockaddr_in place_of(address where) {
-    sockaddr_in place = {};
-    place.sin_family = AF_INET;
-    place.sin_port = htons(PORT);
-    place.sin_addr.s_addr = htonl(where);
-    return place;
+sockaddr_in make_sockaddr(address where) {
+    sockaddr_in name = {};
+    name.sin_family = AF_INET;
+    name.sin_port = htons(PORT);
+    name.sin_addr.s_addr = htonl(where);
+    return name;
 }
 
-static int open_socket(address where) {
+int open_socket(address where) {
     const int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
     const int one = 1;
-    const sockaddr_in place = place_of(where);
+    const sockaddr_in name = make_sockaddr(where);
     if (fd < 0 || setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one) != 0 ||
-        bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0) {
+        bind(fd, reinterpret_cast<const sockaddr *>(&name), sizeof name) != 0) {
         fprintf(stderr, "wccp_router: %s: %s\n", text_of(where).c_str(), strerror(errno));
         exit(1);
     }
-    // All groups of an appliance say Here-I-Am at once.
+    // All groups of an appliance send Here-I-Am at the same time.
     const int buffer = 4 << 20;
     if (setsockopt(fd, SOL_SOCKET, SO_RCVBUFFORCE, &buffer, sizeof buffer) != 0)
         (void)setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &buffer, sizeof buffer);
     return fd;
 }
 
-static void open_station(station *one) {
+void open_station(station *one) {
     const router_options &options = one->machine.options;
     one->unicast = open_socket(options.self);
     if (options.group == 0)
@@ -90,12 +92,12 @@ static void open_station(station *one) {
     }
 }
 
-static void carry_out(const lab_process &all, station *one, const output &out) {
+void send_output(const lab_process &all, station *one, const output &out) {
     for (const datagram &packet : out.send) {
-        const sockaddr_in place = place_of(packet.to);
+        const sockaddr_in name = make_sockaddr(packet.to);
         if (sendto(one->unicast, packet.data.data(), packet.data.size(), 0,
-                   reinterpret_cast<const sockaddr *>(&place), sizeof place) < 0)
-            count(&one->machine, "tx_failures");
+                   reinterpret_cast<const sockaddr *>(&name), sizeof name) < 0)
+            count_event(&one->machine, "tx_failures");
     }
     for (const json &event : out.events)
         puts((all.as_json ? event.dump() : event_line(event)).c_str());
@@ -103,22 +105,22 @@ static void carry_out(const lab_process &all, station *one, const output &out) {
         fflush(stdout);
 }
 
-static void receive_from(const lab_process &all, station *one, int fd, address to) {
+void receive_from(const lab_process &all, station *one, int fd, address to) {
     for (;;) {
         uint8_t data[65536];
-        sockaddr_in place = {};
-        socklen_t length = sizeof place;
-        const ssize_t got = recvfrom(fd, data, sizeof data, 0, reinterpret_cast<sockaddr *>(&place), &length);
+        sockaddr_in name = {};
+        socklen_t length = sizeof name;
+        const ssize_t got = recvfrom(fd, data, sizeof data, 0, reinterpret_cast<sockaddr *>(&name), &length);
         if (got < 0)
             return;
         output out;
-        router_receive(&one->machine, seconds_now() - all.began, ntohl(place.sin_addr.s_addr), to,
+        router_receive(&one->machine, seconds_now() - all.began, ntohl(name.sin_addr.s_addr), to,
                        bytes(data, data + got), &out);
-        carry_out(all, one, out);
+        send_output(all, one, out);
     }
 }
 
-static std::string run_command(lab_process *all, const std::string &line) {
+std::string run_command(lab_process *all, const std::string &line) {
     std::istringstream in(line);
     std::vector<std::string> words{std::istream_iterator<std::string>(in), {}};
     std::optional<address> only;
@@ -126,7 +128,7 @@ static std::string run_command(lab_process *all, const std::string &line) {
         only = address_of(words[0].substr(1));
         words.erase(words.begin());
         if (!only)
-            return "error: that is no address\n";
+            return "error: not an address\n";
     }
     std::string answers;
     for (station &one : all->stations) {
@@ -134,7 +136,7 @@ static std::string run_command(lab_process *all, const std::string &line) {
             continue;
         output out;
         const std::string answer = router_command(&one.machine, seconds_now() - all->began, words, &out);
-        carry_out(*all, &one, out);
+        send_output(*all, &one, out);
         answers += answer + "\n";
         if (answer.starts_with("error:"))
             return answer + "\n";
@@ -142,13 +144,13 @@ static std::string run_command(lab_process *all, const std::string &line) {
     return answers.empty() ? "error: no such router\n" : answers;
 }
 
-static void serve_control(lab_process *all, int listener) {
+void serve_control(lab_process *all, int listener) {
     const int fd = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
     if (fd < 0)
         return;
-    const timeval patience = {1, 0};
-    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
-    setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
+    const timeval limit = {1, 0};
+    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
+    setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
     std::string line;
     char part[512];
     while (line.find('\n') == std::string::npos && line.size() < 65536) {
@@ -167,7 +169,7 @@ static void serve_control(lab_process *all, int listener) {
     close(fd);
 }
 
-static int open_signals() {
+int open_signals() {
     sigset_t set;
     sigemptyset(&set);
     for (const int number : {SIGTERM, SIGINT, SIGHUP, SIGUSR1})
@@ -176,7 +178,7 @@ static int open_signals() {
     return signalfd(-1, &set, SFD_CLOEXEC | SFD_NONBLOCK);
 }
 
-static void run(lab_process *all, int control) {
+void run_loop(lab_process *all, int control) {
     const int signals = open_signals();
     std::string typed;
     std::vector<pollfd> fds = {{signals, POLLIN, 0}, {control, POLLIN, 0}, {STDIN_FILENO, POLLIN, 0}};
@@ -223,7 +225,7 @@ static void run(lab_process *all, int control) {
                 receive_from(*all, &one, one.multicast, one.machine.options.group);
             output out;
             router_tick(&one.machine, seconds_now() - all->began, &out);
-            carry_out(*all, &one, out);
+            send_output(*all, &one, out);
         }
         for (size_t i = path_at; i < fds.size(); i++)
             if (fds[i].revents)
@@ -231,12 +233,12 @@ static void run(lab_process *all, int control) {
     }
 }
 
-// Interfaces that redirect, for the only router there is.
-static void open_path(lab_process *all, const std::vector<std::string> &redirect) {
+// Opens the data path, for a single router.
+void open_path(lab_process *all, const std::vector<std::string> &redirect) {
     for (const std::string &text : redirect) {
         redirecting one;
         if (!read_redirecting(text, &one)) {
-            fprintf(stderr, "wccp_router: redirect what by %s?\n", text.c_str());
+            fprintf(stderr, "wccp_router: --redirect %s: not INTERFACE=SERVICE[,SERVICE]\n", text.c_str());
             exit(2);
         }
         all->path.from.push_back(one);
@@ -244,7 +246,7 @@ static void open_path(lab_process *all, const std::vector<std::string> &redirect
     if (redirect.empty())
         return;
     if (all->stations.size() != 1) {
-        fputs("wccp_router: one router alone can redirect\n", stderr);
+        fputs("wccp_router: --redirect needs exactly one --router\n", stderr);
         exit(2);
     }
     all->path.self = &all->stations.front().machine;
@@ -257,27 +259,29 @@ static void open_path(lab_process *all, const std::vector<std::string> &redirect
 }
 
 // "gre,l2" and "hash,mask" as bits.
-static uint32_t bits_of(const std::vector<std::string> &words, const char *first, const char *second) {
+uint32_t bits_of(const std::vector<std::string> &words, const char *first, const char *second) {
     uint32_t bits = 0;
     for (const std::string &word : words)
         bits |= word == first ? 1U : word == second ? 2U : 0U;
     return bits;
 }
 
-// NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
+} // namespace
+
+// NOLINTNEXTLINE(bugprone-exception-escape): this program may end when memory is exhausted
 int main(int argc, char **argv) {
     CLI::App app("simulated WCCP version 2 routers");
     app.set_version_flag("--version", std::string("wccp_router ") + wccp_version());
-    app.footer(std::string("Commands on standard input or through --control:\n") + ROUTER_COMMANDS);
+    app.footer(std::string("Commands on standard input or the control socket:\n") + ROUTER_COMMANDS);
     app.require_subcommand(0, 1);
     std::vector<std::string> routers, redirect, forward = {"gre", "l2"}, giveback = {"gre", "l2"},
                                                 assign = {"hash", "mask"};
     std::vector<uint16_t> services;
-    std::string form = "ios", multicast, reply = "group", join = "echo", control_path, gre_source;
+    std::string format = "ios", multicast, reply = "group", join = "echo", control_path, gre_source;
     router_options options;
     lab_process all;
-    app.add_option("--router", routers, "address of a router; may come often")->delimiter(',');
-    app.add_option("--form", form, "of the views")->check(CLI::IsMember({"ios", "nexus"}));
+    app.add_option("--router", routers, "address of a router; can be repeated")->delimiter(',');
+    app.add_option("--format", format, "of the views")->check(CLI::IsMember({"ios", "nexus"}));
     app.add_option("--forward", forward, "methods offered")
         ->delimiter(',')
         ->check(CLI::IsMember({"gre", "l2"}));
@@ -291,38 +295,40 @@ int main(int argc, char **argv) {
     app.add_option("--service", services, "service ids served (default: any)")
         ->delimiter(',')
         ->check(CLI::Range(0, 255));
-    app.add_option("--group", multicast, "multicast address to listen to");
-    app.add_option("--reply", reply, "where to, for what came by multicast")
+    app.add_option("--group", multicast, "multicast address to join");
+    app.add_option("--reply", reply, "destination of answers to multicast messages")
         ->check(CLI::IsMember({"group", "unicast"}));
-    app.add_option("--join", join,
-                   "when an appliance enters the view: at its first Here-I-Am, or once it has "
-                   "echoed a receive id")
+    app.add_option(
+           "--join", join,
+           "when an appliance enters the view: at its first Here-I-Am, or once it has echoed a receive id")
         ->check(CLI::IsMember({"first", "echo"}));
-    app.add_option("--query-after", options.query_after, "seconds of silence before a Removal Query");
-    app.add_option("--drop-after", options.drop_after, "seconds of silence before an appliance is dropped");
+    app.add_option("--query-after", options.query_after, "seconds without a message before a Removal Query");
+    app.add_option("--drop-after", options.drop_after,
+                   "seconds without a message before an appliance is dropped");
     app.add_option("--redirect", redirect,
-                   "INTERFACE=SERVICE[,SERVICE]: what comes in there goes to the appliances; may come often");
-    app.add_option("--gre", options.gre_form,
-                   "redirected packets: with redirect header, without it, as type 0x0800")
-        ->check(CLI::IsMember(std::vector<std::string>(std::begin(gre_forms), std::end(gre_forms))));
-    app.add_option("--gre-source", gre_source, "address that they come from (default: the router's)");
+                   "INTERFACE=SERVICE[,SERVICE]: redirect packets from this interface; can be repeated");
+    app.add_option("--gre", options.gre_format,
+                   "format of redirected packets: with redirect header, without it, type 0x0800")
+        ->check(CLI::IsMember(std::vector<std::string>(std::begin(gre_formats), std::end(gre_formats))));
+    app.add_option("--gre-source", gre_source,
+                   "source address of redirected packets (default: the router's)");
     app.add_option("--control", control_path, "unix socket for commands");
     app.add_flag("--json", all.as_json, "one JSON object per message");
 
     std::string log_file, socket_path;
     std::vector<std::string> command;
-    CLI::App *logd = app.add_subcommand("logd", "a log daemon on /dev/log");
-    logd->add_option("FILE", log_file, "where lines go; - for standard output")->required();
-    CLI::App *ctl = app.add_subcommand("ctl", "send one command to a control socket");
+    CLI::App *logd = app.add_subcommand("logd", "run a log daemon on /dev/log");
+    logd->add_option("FILE", log_file, "file to append to; - for standard output")->required();
+    CLI::App *ctl = app.add_subcommand("ctl", "send a command to a control socket");
     ctl->add_option("SOCKET", socket_path)->required();
     ctl->add_option("COMMAND", command)->required();
     web_options web;
     fetch_options fetch;
     CLI::App *server =
-        app.add_subcommand("web", "a web server: GET /N answers with N bytes, POST takes a body");
-    server->add_option("--port", web.ports, "may come often")->required();
+        app.add_subcommand("web", "run a web server: GET /N answers with N bytes, POST takes a body");
+    server->add_option("--port", web.ports, "can be repeated")->required();
     CLI::App *client =
-        app.add_subcommand("fetch", "fetch pages, and say in JSON how it went and who answered");
+        app.add_subcommand("fetch", "fetch pages, and print the results and who answered as JSON");
     add_fetch_options(client, &fetch);
     CLI11_PARSE(app, argc, argv);
 
@@ -338,7 +344,7 @@ int main(int argc, char **argv) {
             line += (line.empty() ? "" : " ") + word;
         return run_ctl(socket_path, line);
     }
-    options.nexus = form == "nexus";
+    options.nexus = format == "nexus";
     options.offer = {bits_of(forward, "gre", "l2"), bits_of(assign, "hash", "mask"),
                      bits_of(giveback, "gre", "l2")};
     options.reply_to_group = reply == "group";
@@ -348,7 +354,7 @@ int main(int argc, char **argv) {
     if (!multicast.empty()) {
         const auto group = address_of(multicast);
         if (!group || *group >> 28 != 0xe) {
-            fprintf(stderr, "wccp_router: %s is no multicast address\n", multicast.c_str());
+            fprintf(stderr, "wccp_router: %s is not a multicast address\n", multicast.c_str());
             return 2;
         }
         options.group = *group;
@@ -356,14 +362,14 @@ int main(int argc, char **argv) {
     if (!gre_source.empty()) {
         options.gre_source = address_of(gre_source).value_or(0);
         if (options.gre_source == 0) {
-            fprintf(stderr, "wccp_router: %s is no address\n", gre_source.c_str());
+            fprintf(stderr, "wccp_router: %s is not an address\n", gre_source.c_str());
             return 2;
         }
     }
     for (const std::string &text : routers) {
         const auto self = address_of(text);
         if (!self) {
-            fprintf(stderr, "wccp_router: %s is no address\n", text.c_str());
+            fprintf(stderr, "wccp_router: %s is not an address\n", text.c_str());
             return 2;
         }
         options.self = *self;
@@ -373,7 +379,7 @@ int main(int argc, char **argv) {
         all.stations.push_back(std::move(one));
     }
     if (all.stations.empty()) {
-        fputs("wccp_router: no --router\n", stderr);
+        fputs("wccp_router: --router is missing\n", stderr);
         return 2;
     }
     open_path(&all, redirect);
@@ -383,7 +389,7 @@ int main(int argc, char **argv) {
         return 1;
     }
     all.began = seconds_now();
-    run(&all, control);
+    run_loop(&all, control);
     if (control >= 0)
         unlink(control_path.c_str());
     return 0;

@@ -1,28 +1,25 @@
-// The router's conversation with its appliances.
+// The router's side of the protocol.
 //
-// A Here-I-Am is answered by an I-See-You with the group's next receive id. An appliance comes into the view
-// once it has echoed an id that went to it, so that both directions are known to work; each such echo counts
-// as a sign of life. An appliance silent for query_after seconds is asked by a Removal Query, and dropped
-// when it has not answered by drop_after. A shutdown command drops it at once. Each change of the view's
-// members, and of the routers that the appliances report, raises the change number.
+// Each Here-I-Am is answered with an I-See-You that has the group's next receive id. An appliance enters the
+// view once it has echoed a receive id, which shows that both directions work; each further echo keeps it
+// alive. After query_after seconds without an echo the router sends a Removal Query, and after drop_after it
+// drops the appliance. A shutdown command drops it at once. The change number increases with each change of
+// the members of the view and of the routers that they report.
 //
-// The first appliance in defines the service and, by the capabilities that it names, the methods of the
-// group; one that differs is answered and not taken in. A Redirect-Assign is adopted when it comes from the
-// lowest address of the view, has the agreed kind, and names this router with the receive id and the change
-// number that the sender saw last; the receive id before that still passes for a second, because the two
-// messages may have crossed. What was adopted is echoed in each I-See-You until it is replaced. Buckets of an
-// appliance that leaves belong to nobody until the next assignment.
+// The first appliance in the view defines the service and the methods of the group. One that differs gets
+// answers, but does not enter the view. A Redirect-Assign is adopted if it comes from the appliance with the
+// lowest address in the view, is of the agreed kind, and has this router's last receive id and change number.
+// The receive id before that is valid for a second, because the two messages may have crossed. The adopted
+// assignment is part of each I-See-You until it is replaced. Buckets of an appliance that leaves have no
+// owner until the next assignment.
 #include "lab/router/router.h"
 
 #include <algorithm>
 
 namespace lab {
 
-constexpr size_t IDS_REMEMBERED = 4;
-constexpr double CROSSING_SECONDS = 1;
-
-void count(router *self, const std::string &what) {
-    self->counters[what]++;
+void count_event(router *self, const std::string &counter) {
+    self->counters[counter]++;
 }
 
 json event_of(const router &self, const group *in, double now, const char *what) {
@@ -35,7 +32,12 @@ json event_of(const router &self, const group *in, double now, const char *what)
     return event;
 }
 
-static json method_words(const methods &chosen) {
+namespace {
+
+constexpr size_t IDS_REMEMBERED = 4;
+constexpr double CROSSING_SECONDS = 1;
+
+json describe_methods(const methods &chosen) {
     const char *encapsulation[] = {"none", "gre", "l2", "gre,l2"};
     const char *assign[] = {"none", "hash", "mask", "hash,mask"};
     return {{"forward", encapsulation[chosen.forward & 3]},
@@ -43,22 +45,22 @@ static json method_words(const methods &chosen) {
             {"return", encapsulation[chosen.giveback & 3]}};
 }
 
-// The methods that the group works by: those of its first member but `except`.
-static const methods *agreed(const group &in, address except) {
+// The methods of the group: those of any member in the view other than `except`.
+const methods *agreed_methods(const group &in, address except) {
     for (const auto &[id, one] : in.members)
         if (one.usable && id != except)
             return &one.chosen;
     return nullptr;
 }
 
-static size_t usable_count(const group &in) {
+size_t usable_count(const group &in) {
     return static_cast<size_t>(std::count_if(in.members.begin(), in.members.end(),
                                              [](const auto &entry) { return entry.second.usable; }));
 }
 
-// ---- what goes out
+// --- Outgoing messages
 
-static std::vector<address> routers_reported(const router &self, const group &in) {
+std::vector<address> list_reported_routers(const router &self, const group &in) {
     std::set<address> all = in.listed;
     for (const auto &[id, one] : in.members)
         if (one.usable)
@@ -71,8 +73,10 @@ static std::vector<address> routers_reported(const router &self, const group &in
     return view;
 }
 
+} // namespace
+
 void refresh_router_view(router *self, group *in, double now, output *out) {
-    std::vector<address> view = routers_reported(*self, *in);
+    std::vector<address> view = list_reported_routers(*self, *in);
     if (view == in->router_view)
         return;
     const bool first = in->router_view.empty();
@@ -87,7 +91,9 @@ void refresh_router_view(router *self, group *in, double now, output *out) {
     out->events.push_back(event);
 }
 
-static size_t values_of(const group &in, address owner) {
+namespace {
+
+size_t count_values(const group &in, address owner) {
     size_t found = 0;
     for (const mask_set &set : in.current.sets)
         found +=
@@ -96,12 +102,12 @@ static size_t values_of(const group &in, address owner) {
     return found;
 }
 
-static view_element element_of(const router &self, const group &in, const member &one) {
+view_element element_of(const router &self, const group &in, const member &one) {
     view_element element;
     element.id = one.id;
     element.weight = one.weight;
     if (one.chosen.assign == 2) {
-        const bool redirected = in.current.by == kind::mask && values_of(in, one.id) > 0;
+        const bool redirected = in.current.by == kind::mask && count_values(in, one.id) > 0;
         element.flags = redirected ? 2 : 3;
         element.is_short = redirected && !self.options.nexus;
         element.mask = in.current.sets.empty() ? one.mask : in.current.sets.front().mask;
@@ -113,8 +119,8 @@ static view_element element_of(const router &self, const group &in, const member
     return element;
 }
 
-// The next receive id, remembered for everybody whom it reaches.
-static uint32_t next_receive_id(const router &self, group *in, member *to, address where, double now) {
+// The next receive id. It is remembered for all appliances that will receive it.
+uint32_t next_receive_id(const router &self, group *in, member *to, address where, double now) {
     const uint32_t id = ++in->receive_id;
     for (auto &[key, one] : in->members) {
         if (&one != to && !(where == self.options.group && one.by_group))
@@ -127,13 +133,15 @@ static uint32_t next_receive_id(const router &self, group *in, member *to, addre
     return id;
 }
 
-static address where_to(const router &self, const member &to) {
+address reply_address(const router &self, const member &to) {
     return to.by_group && self.options.reply_to_group ? self.options.group : to.source;
 }
 
+} // namespace
+
 void send_i_see_you(router *self, group *in, member *to, double now, output *out, uint16_t command) {
     refresh_router_view(self, in, now, out);
-    const address where = where_to(*self, *to);
+    const address where = reply_address(*self, *to);
     i_see_you message;
     message.service = in->service;
     message.router = self->options.self;
@@ -171,7 +179,7 @@ void send_i_see_you(router *self, group *in, member *to, double now, output *out
             self->fault_left--;
         spoil_message(fault, &message, &password);
         event["fault"] = fault;
-        count(self, "faults");
+        count_event(self, "faults");
     }
     bytes data = write_message(message, password);
     if (!fault.empty())
@@ -179,11 +187,11 @@ void send_i_see_you(router *self, group *in, member *to, double now, output *out
     event["bytes"] = data.size();
     out->send.push_back({where, std::move(data)});
     out->events.push_back(event);
-    count(self, "tx_i_see_you");
+    count_event(self, "tx_i_see_you");
 }
 
 void send_query(router *self, group *in, member *to, double now, output *out) {
-    const address where = where_to(*self, *to);
+    const address where = reply_address(*self, *to);
     removal_query message;
     message.service = in->service;
     message.router = self->options.self;
@@ -197,10 +205,10 @@ void send_query(router *self, group *in, member *to, double now, output *out) {
     event["receive_id"] = message.receive_id;
     out->send.push_back({where, write_message(message, self->options.password)});
     out->events.push_back(event);
-    count(self, "tx_removal_query");
+    count_event(self, "tx_removal_query");
 }
 
-// ---- membership
+// --- Membership
 
 void drop_member(router *self, group *in, address id, double now, const char *why, output *out) {
     const auto place = in->members.find(id);
@@ -227,13 +235,15 @@ void drop_member(router *self, group *in, address id, double now, const char *wh
     event["why"] = why;
     event["change_number"] = in->change_number;
     out->events.push_back(event);
-    count(self, "left");
+    count_event(self, "left");
     refresh_router_view(self, in, now, out);
 }
 
-// Empty when the appliance may be in the view with what it says in this message.
-static std::string objection(const router &self, const group &in, const service_info &service,
-                             const here_i_am &hello) {
+namespace {
+
+// The reason why the appliance may not be in the view with this message; empty if it may.
+std::string find_objection(const router &self, const group &in, const service_info &service,
+                           const here_i_am &hello) {
     const methods &offer = self.options.offer;
     const methods &chosen = hello.chosen;
     if (chosen.forward < 1 || chosen.forward > 2 || !(offer.forward & chosen.forward))
@@ -242,7 +252,7 @@ static std::string objection(const router &self, const group &in, const service_
         return "assignment method not offered";
     if (chosen.giveback < 1 || chosen.giveback > 2 || !(offer.giveback & chosen.giveback))
         return "return method not offered";
-    const methods *others = agreed(in, hello.id);
+    const methods *others = agreed_methods(in, hello.id);
     if (others && !(*others == chosen))
         return "methods differ from the group's";
     if (others && in.defined && !(in.service == service))
@@ -254,8 +264,8 @@ static std::string objection(const router &self, const group &in, const service_
     return "";
 }
 
-// What became of the echo in a Here-I-Am.
-static const char *look_at_echo(const router &self, const member &one, const here_i_am &hello) {
+// Whether the Here-I-Am echoes a receive id of this router: "good", "stale" or "none".
+const char *check_echo(const router &self, const member &one, const here_i_am &hello) {
     for (const router_mark &mark : hello.routers) {
         if (mark.router != self.options.self)
             continue;
@@ -266,15 +276,14 @@ static const char *look_at_echo(const router &self, const member &one, const her
     return "none";
 }
 
-static const char *take_hello(router *self, group *in, member *one, const incoming &message, const char *echo,
-                              double now, output *out) {
+const char *accept_hello(router *self, group *in, member *one, const incoming &message, const char *echo,
+                         double now, output *out) {
     const here_i_am &hello = message.hello;
     const bool echoed = std::string_view(echo) == "good";
     if (!echoed && !(self->options.join_at_first && !one->usable && std::string_view(echo) == "none"))
         return echo;
-    // An appliance that has not heard a router yet can't have chosen: it is taken at its word from its first
-    // echo.
-    one->refused = echoed ? objection(*self, *in, message.service, hello) : "";
+    // Before its first echo an appliance has not seen the router's offer, and its methods mean nothing.
+    one->refused = echoed ? find_objection(*self, *in, message.service, hello) : "";
     if (!one->refused.empty()) {
         const std::string why = one->refused;
         if (one->usable) {
@@ -283,7 +292,7 @@ static const char *take_hello(router *self, group *in, member *one, const incomi
             member &again = in->members[hello.id] = kept;
             again.usable = false;
         }
-        count(self, "refused_appliances");
+        count_event(self, "refused_appliances");
         return "refused";
     }
     one->heard_at = now;
@@ -293,7 +302,7 @@ static const char *take_hello(router *self, group *in, member *one, const incomi
     one->routers.clear();
     for (const router_mark &mark : hello.routers)
         one->routers.push_back(mark.router);
-    const bool first = !agreed(*in, hello.id);
+    const bool first = !agreed_methods(*in, hello.id);
     if (first && one->usable && !(one->chosen == hello.chosen))
         in->current = {};
     one->chosen = hello.chosen;
@@ -308,28 +317,28 @@ static const char *take_hello(router *self, group *in, member *one, const incomi
     json event = event_of(*self, in, now, "joined");
     event["appliance"] = text_of(hello.id);
     event["weight"] = hello.weight;
-    event["methods"] = method_words(hello.chosen);
+    event["methods"] = describe_methods(hello.chosen);
     event["change_number"] = in->change_number;
     out->events.push_back(event);
-    count(self, "joined");
+    count_event(self, "joined");
     return "joined";
 }
 
-static void receive_hello(router *self, group *in, const incoming &message, double now, address from,
-                          address to, json event, output *out) {
+void receive_hello(router *self, group *in, const incoming &message, double now, address from, address to,
+                   json event, output *out) {
     const here_i_am &hello = message.hello;
     event["appliance"] = text_of(hello.id);
     event["weight"] = hello.weight;
-    event["form"] = hello.mask_form ? "mask" : "hash";
-    event["methods"] = method_words(hello.chosen);
+    event["format"] = hello.mask_format ? "mask" : "hash";
+    event["methods"] = describe_methods(hello.chosen);
     event["change_number"] = hello.change_number;
     event["routers"] = hello.routers.size();
     event["appliances"] = hello.appliances.size();
-    count(self, "rx_here_i_am");
+    count_event(self, "rx_here_i_am");
     if (hello.id == 0) {
         event["result"] = "refused: no identity";
         out->events.push_back(event);
-        count(self, "rx_refused");
+        count_event(self, "rx_refused");
         return;
     }
     member &one = in->members[hello.id];
@@ -338,30 +347,30 @@ static void receive_hello(router *self, group *in, const incoming &message, doub
     one.by_group = self->options.group != 0 && to == self->options.group;
     if (!one.usable)
         one.heard_at = now;
-    const char *echo = look_at_echo(*self, one, hello);
+    const char *echo = check_echo(*self, one, hello);
     event["echo"] = echo;
     if (hello.command && hello.command->command == COMMAND_SHUTDOWN && hello.command->data == hello.id &&
         one.usable) {
         event["result"] = "shutdown";
         out->events.push_back(event);
-        count(self, "rx_shutdown");
+        count_event(self, "rx_shutdown");
         member leaving = one;
         drop_member(self, in, hello.id, now, "shutdown", out);
         send_i_see_you(self, in, &leaving, now, out, COMMAND_SHUTDOWN_SEEN);
         return;
     }
     const size_t place = out->events.size();
-    const char *result = take_hello(self, in, &one, message, echo, now, out);
+    const char *result = accept_hello(self, in, &one, message, echo, now, out);
     member &kept = in->members[hello.id];
     event["result"] = kept.refused.empty() ? std::string(result) : "refused: " + kept.refused;
     out->events.insert(out->events.begin() + static_cast<std::ptrdiff_t>(place), event);
     send_i_see_you(self, in, &kept, now, out, 0);
 }
 
-// ---- assignment
+// --- Assignment
 
-static std::string judge_assignment(const router &self, const group &in, const redirect_assign &assign,
-                                    address from, double now) {
+std::string judge_assignment(const router &self, const group &in, const redirect_assign &assign, address from,
+                             double now) {
     const auto sender = in.members.find(assign.key);
     if (sender == in.members.end() || !sender->second.usable || sender->second.source != from)
         return "not from a member";
@@ -387,12 +396,13 @@ static std::string judge_assignment(const router &self, const group &in, const r
     return "this router is not named";
 }
 
-static address if_member(const group &in, address owner) {
+// `owner`, or 0 if it is not in the view.
+address owner_if_usable(const group &in, address owner) {
     const auto place = in.members.find(owner);
     return place != in.members.end() && place->second.usable ? owner : 0;
 }
 
-static void adopt(group *in, const redirect_assign &assign) {
+void adopt_assignment(group *in, const redirect_assign &assign) {
     assignment fresh;
     fresh.by = assign.by_mask ? kind::mask : kind::hash;
     fresh.key = assign.key;
@@ -401,49 +411,51 @@ static void adopt(group *in, const redirect_assign &assign) {
         fresh.sets = assign.sets;
         for (mask_set &set : fresh.sets)
             for (mask_value &value : set.values)
-                value.owner = if_member(*in, value.owner);
+                value.owner = owner_if_usable(*in, value.owner);
     } else {
         for (size_t i = 0; i < BUCKETS; i++)
             if (assign.buckets[i] != NO_APPLIANCE)
-                fresh.buckets[i] = if_member(*in, assign.appliances[assign.buckets[i]]);
+                fresh.buckets[i] = owner_if_usable(*in, assign.appliances[assign.buckets[i]]);
     }
     in->current = std::move(fresh);
 }
 
-static void receive_assignment(router *self, group *in, const incoming &message, double now, address from,
-                               json event, output *out) {
+void receive_assignment(router *self, group *in, const incoming &message, double now, address from,
+                        json event, output *out) {
     const redirect_assign &assign = message.assign;
     event["key"] = text_of(assign.key) + "/" + std::to_string(assign.key_change);
     event["kind"] = assign.by_mask ? "mask" : "hash";
-    count(self, "rx_redirect_assign");
+    count_event(self, "rx_redirect_assign");
     const std::string wrong = judge_assignment(*self, *in, assign, from, now);
     if (!wrong.empty()) {
         event["result"] = "ignored: " + wrong;
-        count(self, "ignored_assignments");
+        count_event(self, "ignored_assignments");
         out->events.push_back(event);
         return;
     }
     const bool again = in->current.key == assign.key && in->current.key_change == assign.key_change;
-    adopt(in, assign);
+    adopt_assignment(in, assign);
     event["result"] = again ? "adopted again" : "adopted";
     for (const auto &[id, one] : in->members) {
         if (!one.usable)
             continue;
         const size_t share =
             assign.by_mask
-                ? values_of(*in, id)
+                ? count_values(*in, id)
                 : static_cast<size_t>(std::count(in->current.buckets.begin(), in->current.buckets.end(), id));
         event["shares"][text_of(id)] = share;
     }
-    count(self, "adopted_assignments");
+    count_event(self, "adopted_assignments");
     out->events.push_back(event);
 }
 
-// ---- the face
+} // namespace
+
+// --- Interface
 
 void router_receive(router *self, double now, address from, address to, const bytes &data, output *out) {
-    if (self->stopped || self->deaf_to.contains(from)) {
-        count(self, "rx_unheard");
+    if (self->stopped || self->ignored.contains(from)) {
+        count_event(self, "rx_unheard");
         return;
     }
     incoming message;
@@ -460,7 +472,7 @@ void router_receive(router *self, double now, address from, address to, const by
     if (!wrong.empty() || !wanted) {
         event["result"] = "refused: " + (wrong.empty() ? std::string("service is not configured") : wrong);
         out->events.push_back(event);
-        count(self, "rx_refused");
+        count_event(self, "rx_refused");
         return;
     }
     group &in = self->groups[message.service.id];
@@ -489,14 +501,16 @@ void router_tick(router *self, double now, output *out) {
     }
 }
 
-static json mask_words(const mask_fields &mask) {
+namespace {
+
+json describe_mask(const mask_fields &mask) {
     return {{"src_ip", mask.src_ip},
             {"dst_ip", mask.dst_ip},
             {"src_port", mask.src_port},
             {"dst_port", mask.dst_port}};
 }
 
-static json group_state(const group &in, double now) {
+json describe_group(const group &in, double now) {
     const char *kinds[] = {"none", "hash", "mask"};
     json state;
     state["service"] = {{"id", in.service.id},
@@ -516,9 +530,9 @@ static json group_state(const group &in, double now) {
         json entry = {{"address", text_of(id)},
                       {"usable", one.usable},
                       {"weight", one.weight},
-                      {"methods", method_words(one.chosen)},
+                      {"methods", describe_methods(one.chosen)},
                       {"buckets", buckets},
-                      {"values", values_of(in, id)},
+                      {"values", count_values(in, id)},
                       {"silent_for", now - one.heard_at},
                       {"queried", one.queried}};
         if (!one.refused.empty())
@@ -532,9 +546,9 @@ static json group_state(const group &in, double now) {
         for (const address owner : current.buckets)
             assigned["buckets"].push_back(owner ? json(text_of(owner)) : json(nullptr));
     for (const mask_set &set : current.sets) {
-        json words = {{"mask", mask_words(set.mask)}, {"values", json::array()}};
+        json words = {{"mask", describe_mask(set.mask)}, {"values", json::array()}};
         for (const mask_value &value : set.values) {
-            json line = mask_words(value.match);
+            json line = describe_mask(value.match);
             line["owner"] = value.owner ? json(text_of(value.owner)) : json(nullptr);
             words["values"].push_back(line);
         }
@@ -543,6 +557,8 @@ static json group_state(const group &in, double now) {
     state["assignment"] = assigned;
     return state;
 }
+
+} // namespace
 
 json traffic_state(const router &self) {
     const traffic &from = self.traffic;
@@ -563,12 +579,12 @@ json traffic_state(const router &self) {
 json router_state(const router &self, double now) {
     json state;
     state["router"] = text_of(self.options.self);
-    state["form"] = self.options.nexus ? "nexus" : "ios";
-    state["offer"] = method_words(self.options.offer);
+    state["format"] = self.options.nexus ? "nexus" : "ios";
+    state["offer"] = describe_methods(self.options.offer);
     state["stopped"] = self.stopped;
     state["groups"] = json::object();
     for (const auto &[number, in] : self.groups)
-        state["groups"][std::to_string(number)] = group_state(in, now);
+        state["groups"][std::to_string(number)] = describe_group(in, now);
     state["counters"] = json::object();
     for (const auto &[name, value] : self.counters)
         state["counters"][name] = value;

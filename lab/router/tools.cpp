@@ -11,10 +11,13 @@
 #include <cstring>
 
 namespace lab {
+namespace {
 
 constexpr const char *LOG_SOCKET = "/dev/log";
 
-static bool fill_address(const std::string &path, sockaddr_un *place) {
+volatile sig_atomic_t ended;
+
+bool fill_address(const std::string &path, sockaddr_un *place) {
     *place = {};
     place->sun_family = AF_UNIX;
     if (path.size() >= sizeof place->sun_path) {
@@ -24,6 +27,8 @@ static bool fill_address(const std::string &path, sockaddr_un *place) {
     memcpy(place->sun_path, path.c_str(), path.size());
     return true;
 }
+
+} // namespace
 
 int listen_at(const std::string &path) {
     sockaddr_un place;
@@ -40,8 +45,6 @@ int listen_at(const std::string &path) {
     return fd;
 }
 
-static volatile sig_atomic_t ended;
-
 int run_logd(const std::string &file) {
     const int out =
         file == "-" ? STDOUT_FILENO : open(file.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
@@ -57,7 +60,7 @@ int run_logd(const std::string &file) {
     action.sa_handler = [](int) { ended = 1; };
     sigaction(SIGTERM, &action, nullptr);
     sigaction(SIGINT, &action, nullptr);
-    signal(SIGCHLD, SIG_IGN); // the dead are collected by the kernel
+    signal(SIGCHLD, SIG_IGN); // the kernel reaps zombies
     char line[8192];
     while (!ended) {
         ssize_t length = recv(fd, line, sizeof line - 1, 0);

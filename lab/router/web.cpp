@@ -1,4 +1,4 @@
-// Blocking sockets with time limits, a thread for each connection.
+// Blocking sockets with timeouts, and a thread for each connection.
 #include "lab/router/web.h"
 
 #include <netinet/in.h>
@@ -25,20 +25,21 @@
 #include "runtime/ttime.h"
 
 namespace lab {
+namespace {
 
 constexpr size_t PIECE = 65536;
 constexpr size_t LONGEST_HEADER = 8192;
 
-static double wall_seconds() {
+double wall_seconds() {
     return static_cast<double>(lt_monotonic_ns()) / 1e9;
 }
 
-// Byte number `at` of any body. The period is no power of two: a lost or repeated packet shows.
-static char content_at(uint64_t at) {
+// The byte at an offset of any body. Its period is not a power of two, so that lost or repeated packets show.
+char content_at(uint64_t at) {
     return static_cast<char>('a' + at % 251 % 26);
 }
-// Content from any place of the period on.
-static const std::string &content() {
+// A piece of content that begins at any offset of the period.
+const std::string &body_content() {
     static const std::string all = [] {
         std::string text(PIECE + 251, ' ');
         for (size_t i = 0; i < text.size(); i++)
@@ -48,7 +49,7 @@ static const std::string &content() {
     return all;
 }
 
-static void set_limits(int fd, double seconds) {
+void set_limits(int fd, double seconds) {
     timeval limit = {};
     limit.tv_sec = static_cast<time_t>(seconds);
     limit.tv_usec = static_cast<suseconds_t>((seconds - static_cast<double>(limit.tv_sec)) * 1e6);
@@ -58,7 +59,7 @@ static void set_limits(int fd, double seconds) {
     setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
 }
 
-static bool send_all(int fd, const char *data, size_t size) {
+bool send_all(int fd, const char *data, size_t size) {
     while (size > 0) {
         const ssize_t went = send(fd, data, size, MSG_NOSIGNAL);
         if (went <= 0)
@@ -68,10 +69,10 @@ static bool send_all(int fd, const char *data, size_t size) {
     }
     return true;
 }
-static bool send_body(int fd, uint64_t size) {
+bool send_body(int fd, uint64_t size) {
     for (uint64_t at = 0; at < size;) {
         const size_t piece = static_cast<size_t>(std::min<uint64_t>(PIECE, size - at));
-        if (!send_all(fd, content().data() + at % 251, piece))
+        if (!send_all(fd, body_content().data() + at % 251, piece))
             return false;
         at += piece;
     }
@@ -80,15 +81,15 @@ static bool send_body(int fd, uint64_t size) {
 
 struct stream {
     int fd;
-    std::string waiting; // read and not used
+    std::string waiting; // received and not yet used
     const char *wrong = "";
-    double rate = 0; // bytes a second at most, 0: no limit
+    double rate = 0; // bytes per second to read, 0: no limit
 };
-static void pause_for(double seconds) {
+void pause_for(double seconds) {
     if (seconds > 0)
         usleep(static_cast<useconds_t>(seconds * 1e6));
 }
-static bool read_more(stream *in) {
+bool read_more(stream *in) {
     char part[PIECE];
     const ssize_t got = recv(in->fd, part, sizeof part, 0);
     if (got > 0) {
@@ -100,7 +101,7 @@ static bool read_more(stream *in) {
     in->wrong = got == 0 ? "closed" : errno == EAGAIN ? "timeout" : errno == ECONNRESET ? "reset" : "read";
     return false;
 }
-static bool read_head(stream *in, std::string *head) {
+bool read_head(stream *in, std::string *head) {
     size_t end;
     while ((end = in->waiting.find("\r\n\r\n")) == std::string::npos) {
         if (in->waiting.size() > LONGEST_HEADER) {
@@ -114,13 +115,12 @@ static bool read_head(stream *in, std::string *head) {
     in->waiting.erase(0, end + 4);
     return true;
 }
-// Reads the body and compares it.
-static bool read_body(stream *in, uint64_t size) {
+bool read_body(stream *in, uint64_t size) {
     for (uint64_t at = 0; at < size;) {
         if (in->waiting.empty() && !read_more(in))
             return false;
         const size_t piece = static_cast<size_t>(std::min<uint64_t>({in->waiting.size(), PIECE, size - at}));
-        if (memcmp(in->waiting.data(), content().data() + at % 251, piece) != 0) {
+        if (memcmp(in->waiting.data(), body_content().data() + at % 251, piece) != 0) {
             in->wrong = "content";
             return false;
         }
@@ -129,7 +129,7 @@ static bool read_body(stream *in, uint64_t size) {
     }
     return true;
 }
-static std::string header_of(const std::string &head, const char *name) {
+std::string header_of(const std::string &head, const char *name) {
     const size_t length = strlen(name);
     for (size_t at = head.find("\r\n"); at != std::string::npos; at = head.find("\r\n", at)) {
         at += 2;
@@ -141,13 +141,13 @@ static std::string header_of(const std::string &head, const char *name) {
     }
     return "";
 }
-static uint64_t number_in(const std::string &text) {
+uint64_t number_in(const std::string &text) {
     return strtoull(text.c_str(), nullptr, 10);
 }
 
-// ---- the server
+// --- The server
 
-static void serve_connection(int fd, address peer) {
+void serve_connection(int fd, address peer) {
     set_limits(fd, 60);
     stream in = {fd, "", ""};
     for (std::string head; read_head(&in, &head);) {
@@ -171,7 +171,7 @@ static void serve_connection(int fd, address peer) {
     close(fd);
 }
 
-static void accept_connections(int listener) {
+void accept_connections(int listener) {
     for (;;) {
         sockaddr_in peer = {};
         socklen_t length = sizeof peer;
@@ -180,6 +180,8 @@ static void accept_connections(int listener) {
             std::thread(serve_connection, fd, ntohl(peer.sin_addr.s_addr)).detach();
     }
 }
+
+} // namespace
 
 int run_web(const web_options &options) {
     std::vector<std::thread> listeners;
@@ -190,7 +192,7 @@ int run_web(const web_options &options) {
         place.sin_family = AF_INET;
         place.sin_port = htons(port);
         setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
-        setsockopt(fd, IPPROTO_IP, IP_TRANSPARENT, &one, sizeof one); // also serves what TPROXY gives it
+        setsockopt(fd, IPPROTO_IP, IP_TRANSPARENT, &one, sizeof one); // for connections that TPROXY redirects
         if (fd < 0 || bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0 ||
             listen(fd, 1024) != 0) {
             perror("web");
@@ -203,15 +205,17 @@ int run_web(const web_options &options) {
     return 0;
 }
 
-// ---- the client
+// --- The client
+
+namespace {
 
 struct fetched {
-    const char *wrong = nullptr; // or why it has failed
+    const char *wrong = nullptr; // why it failed
     std::string proxy, peer;
     bool last = false; // the server closes the connection after this answer
     double took = 0;
 };
-static const char *connect_from(int fd, const fetch_options &options, uint32_t source) {
+const char *connect_from(int fd, const fetch_options &options, uint32_t source) {
     sockaddr_in place = {};
     place.sin_family = AF_INET;
     if (!options.from.empty()) {
@@ -225,14 +229,15 @@ static const char *connect_from(int fd, const fetch_options &options, uint32_t s
         return nullptr;
     return errno == EINPROGRESS ? "connect timeout" : errno == ECONNREFUSED ? "refused" : "connect";
 }
-static std::string request_of(const fetch_options &options) {
+std::string make_request(const fetch_options &options) {
     const bool post = options.upload > 0;
     return std::string(post ? "POST /upload" : "GET /" + std::to_string(options.size)) +
            " HTTP/1.1\r\nHost: " + options.server + "\r\n" +
            (post ? "Content-Length: " + std::to_string(options.upload) + "\r\n" : "") + "\r\n";
 }
-// One request and its answer.
-static const char *talk(stream *in, const std::string &request, const fetch_options &options, fetched *out) {
+// Sends a request and reads the answer; the result is nullptr, or why it failed.
+const char *exchange_request(stream *in, const std::string &request, const fetch_options &options,
+                             fetched *out) {
     std::string head;
     in->wrong = "send";
     if (!send_all(in->fd, request.data(), request.size()) || !send_body(in->fd, options.upload) ||
@@ -249,21 +254,21 @@ static const char *talk(stream *in, const std::string &request, const fetch_opti
     out->last = strcasecmp(header_of(head, "Connection").c_str(), "close") == 0;
     return nullptr;
 }
-static fetched fetch_once(const fetch_options &options, uint32_t source) {
+fetched fetch_once(const fetch_options &options, uint32_t source) {
     fetched one;
     const double began = wall_seconds();
     const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     set_limits(fd, options.timeout);
-    const int little = 32768; // what comes faster than it is read waits at the sender
+    const int small = 32768; // makes the sender wait for a slow reader
     if (options.rate > 0)
-        setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &little, sizeof little);
+        setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &small, sizeof small);
     one.wrong = connect_from(fd, options, source);
     stream in = {fd, "", "", options.rate};
-    const std::string request = request_of(options);
+    const std::string request = make_request(options);
     for (uint32_t i = 0; i < options.requests && !one.wrong; i++) {
         if (i > 0)
             pause_for(options.pause);
-        one.wrong = talk(&in, request, options, &one);
+        one.wrong = exchange_request(&in, request, options, &one);
     }
     close(fd);
     one.took = wall_seconds() - began;
@@ -274,10 +279,10 @@ struct tally {
     std::mutex lock;
     std::atomic<uint32_t> next = 0;
     uint64_t good = 0, failed = 0;
-    double slowest = 0, last_good = 0, longest_gap = 0; // a gap: nothing was fetched
+    double slowest = 0, last_good = 0, longest_gap = 0; // gap: a time without a completed fetch
     std::map<std::string, uint64_t> proxies, peers, failures;
 };
-static void fetch_many(const fetch_options &options, double began, tally *all) {
+void fetch_many(const fetch_options &options, double began, tally *all) {
     for (;;) {
         const uint32_t number = all->next++;
         if (options.seconds > 0 ? wall_seconds() - began >= options.seconds : number >= options.count)
@@ -302,15 +307,15 @@ static void fetch_many(const fetch_options &options, double began, tally *all) {
     }
 }
 
-// ---- long connections
+// --- Long connections
 
-struct crowd {
+struct connection_pool {
     const fetch_options &options;
     const std::string request;
-    double until = 0;               // wall_seconds(); 0: until it is told to end
-    std::atomic<bool> over = false; // every connection ends after its next answer
-    std::atomic<bool> aging = false;
-    std::mutex lock = {}; // for what follows, and for standard output
+    double until = 0;                // in wall_seconds(); 0: until SIGTERM
+    std::atomic<bool> over = false;  // every connection ends after its next answer
+    std::atomic<bool> aging = false; // after SIGUSR1
+    std::mutex lock = {};            // for the members below and for standard output
     uint64_t opened = 0, ended = 0, broken = 0, unopened = 0, answers = 0;
     double slowest = 0;
     std::map<std::string, uint64_t> broken_by = {}, failures = {};
@@ -322,11 +327,11 @@ struct long_connection {
     std::string proxy;
 };
 
-static bool is_over(const crowd &all) {
+bool is_over(const connection_pool &all) {
     return all.over || (all.until > 0 && wall_seconds() >= all.until);
 }
-// `asked` is the time of the request after which it happened, in seconds since 1970.
-static void print_event(const char *what, const long_connection &one, double asked, const char *why) {
+// `asked` is the time of the last request before the event, in seconds since 1970.
+void print_event(const char *what, const long_connection &one, double asked, const char *why) {
     nlohmann::ordered_json event = {{"asked", asked},
                                     {"what", what},
                                     {"connection", one.number},
@@ -337,17 +342,17 @@ static void print_event(const char *what, const long_connection &one, double ask
     puts(event.dump().c_str());
     fflush(stdout);
 }
-static double seconds_since_1970() {
+double seconds_since_1970() {
     timespec now = {};
     clock_gettime(CLOCK_REALTIME, &now);
     return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
 }
 
-// False when the connection has ended, by whatever.
-static bool ask_again(crowd *all, long_connection *one, uint64_t last_answer) {
+// Sends a request; false if the connection has ended for any reason.
+bool ask_again(connection_pool *all, long_connection *one, uint64_t last_answer) {
     fetched answer;
     const double asked = seconds_since_1970(), began = wall_seconds();
-    const char *wrong = talk(&one->in, all->request, all->options, &answer);
+    const char *wrong = exchange_request(&one->in, all->request, all->options, &answer);
     const std::lock_guard guard(all->lock);
     if (wrong) {
         all->broken++;
@@ -367,8 +372,8 @@ static bool ask_again(crowd *all, long_connection *one, uint64_t last_answer) {
     print_event("ended", *one, asked, nullptr);
     return false;
 }
-// From its opening to its end. The requests of all connections are spread over each second.
-static void live_connection(crowd *all, long_connection *one) {
+// Runs an open connection until it ends. The requests of all connections are spread over each second.
+void run_connection(connection_pool *all, long_connection *one) {
     const double phase = static_cast<double>(one->number) / all->options.long_lived;
     uint64_t last_answer = all->aging ? all->options.life : UINT64_MAX;
     while (!is_over(*all)) {
@@ -380,7 +385,7 @@ static void live_connection(crowd *all, long_connection *one) {
         usleep(static_cast<useconds_t>((std::floor(now - phase) + 1 + phase - now) * 1e6));
     }
 }
-static void keep_connected(crowd *all, uint32_t number) {
+void keep_connected(connection_pool *all, uint32_t number) {
     const fetch_options &options = all->options;
     usleep(number * 1'000'000U / options.long_lived);
     while (!is_over(*all)) {
@@ -394,14 +399,14 @@ static void keep_connected(crowd *all, uint32_t number) {
                 print_event("unopened", one, seconds_since_1970(), wrong);
         }
         if (!wrong)
-            live_connection(all, &one);
+            run_connection(all, &one);
         close(one.in.fd);
         usleep(200'000);
     }
 }
 
-static int keep_all_connected(const fetch_options &options) {
-    crowd all = {options, request_of(options)};
+int keep_all_connected(const fetch_options &options) {
+    connection_pool all = {options, make_request(options)};
     if (options.seconds > 0)
         all.until = wall_seconds() + options.seconds;
     sigset_t signals;
@@ -431,23 +436,24 @@ static int keep_all_connected(const fetch_options &options) {
     return all.broken == 0 && all.answers > 0 ? 0 : 1;
 }
 
+} // namespace
+
 void add_fetch_options(CLI::App *app, fetch_options *options) {
     app->add_option("SERVER", options->server)->required()->check(CLI::ValidIPV4);
     app->add_option("--port", options->port);
     app->add_option("--from", options->from, "first source address")->check(CLI::ValidIPV4);
-    app->add_option("--sources", options->sources, "source addresses from there on")
-        ->check(CLI::PositiveNumber);
-    app->add_option("--count", options->count, "connections, one after the other");
+    app->add_option("--sources", options->sources, "number of source addresses")->check(CLI::PositiveNumber);
+    app->add_option("--count", options->count, "number of connections");
     app->add_option("--requests", options->requests, "on each connection");
     app->add_option("--parallel", options->parallel, "connections at a time")->check(CLI::Range(1, 4096));
-    app->add_option("--size", options->size, "bytes asked for");
-    app->add_option("--upload", options->upload, "bytes posted instead");
-    app->add_option("--timeout", options->timeout, "seconds of silence that a fetch survives");
-    app->add_option("--seconds", options->seconds, "go on for so long, whatever --count says");
+    app->add_option("--size", options->size, "bytes to fetch");
+    app->add_option("--upload", options->upload, "bytes to post instead");
+    app->add_option("--timeout", options->timeout, "seconds that each step of a fetch may take");
+    app->add_option("--seconds", options->seconds, "continue for that long, regardless of --count");
     app->add_option("--pause", options->pause, "seconds after each request");
-    app->add_option("--rate", options->rate, "bytes a second that each connection reads");
+    app->add_option("--rate", options->rate, "bytes per second that each connection reads");
     app->add_option("--long", options->long_lived,
-                    "so many connections that last, with a request per second on each")
+                    "keep that many connections open, with a request per second on each")
         ->check(CLI::Range(1, 4096));
     app->add_option("--life", options->life, "requests on each of them after SIGUSR1")
         ->check(CLI::PositiveNumber);

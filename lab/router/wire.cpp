@@ -1,6 +1,6 @@
-// Reading never trusts a length: one cursor gives values or refuses, and remembers what it missed, so that a
-// message is looked at once it has been read to its end. Writing appends; the lengths of a component and of
-// the message are filled in when their end is known, and the digest last.
+// No length is trusted: the reader checks each value against what is left, and remembers the first one that
+// is missing, so that the caller needs to check only after a series of reads. The writer appends, fills in
+// the lengths of components and of the message when their ends are known, and computes the digest last.
 #include "lab/router/wire.h"
 
 #include <arpa/inet.h>
@@ -12,10 +12,6 @@
 #include "runtime/md5.h"
 
 namespace lab {
-
-constexpr size_t PASSWORD_BYTES = 8;
-constexpr size_t HEADER_BYTES = 8;
-constexpr size_t DIGEST_PLACE = HEADER_BYTES + 8;
 
 std::string text_of(address a) {
     char text[INET_ADDRSTRLEN];
@@ -30,11 +26,17 @@ std::optional<address> address_of(const std::string &text) {
     return ntohl(wire.s_addr);
 }
 
-static std::array<uint8_t, MD5_DIGEST_BYTES> digest_of(const bytes &message, std::string_view password) {
+namespace {
+
+constexpr size_t PASSWORD_BYTES = 8;
+constexpr size_t HEADER_BYTES = 8;
+constexpr size_t DIGEST_OFFSET = HEADER_BYTES + 8;
+
+std::array<uint8_t, MD5_DIGEST_BYTES> digest_of(const bytes &message, std::string_view password) {
     uint8_t secret[PASSWORD_BYTES] = {};
     memcpy(secret, password.data(), std::min(password.size(), PASSWORD_BYTES));
     bytes blank = message;
-    std::fill_n(blank.begin() + DIGEST_PLACE, MD5_DIGEST_BYTES, uint8_t{0});
+    std::fill_n(blank.begin() + DIGEST_OFFSET, MD5_DIGEST_BYTES, uint8_t{0});
     std::array<uint8_t, MD5_DIGEST_BYTES> digest;
     md5_state state;
     md5_init(&state);
@@ -44,12 +46,12 @@ static std::array<uint8_t, MD5_DIGEST_BYTES> digest_of(const bytes &message, std
     return digest;
 }
 
-// ---- reading
+// --- Reading
 
 struct reader {
     const uint8_t *place;
     size_t left;
-    std::string missed; // what did not fit, the first time
+    std::string missed; // the first value that did not fit; empty: none
 
     bool want(size_t count, const char *what) {
         if (missed.empty() && count > left)
@@ -68,7 +70,7 @@ struct reader {
     uint8_t u8(const char *what) { return static_cast<uint8_t>(take(1, what)); }
     uint16_t u16(const char *what) { return static_cast<uint16_t>(take(2, what)); }
     uint32_t u32(const char *what) { return take(4, what); }
-    // A count of things of that many bytes each: refused when they can't all be there.
+    // The number of entries of `each` bytes; an error if so many do not fit into what is left.
     uint32_t count(size_t each, const char *what) {
         const uint32_t value = u32(what);
         if (missed.empty() && value > left / each)
@@ -81,7 +83,7 @@ struct reader {
     }
 };
 
-static mask_fields read_mask(reader *in) {
+mask_fields read_mask(reader *in) {
     mask_fields mask;
     mask.src_ip = in->u32("source mask");
     mask.dst_ip = in->u32("destination mask");
@@ -90,7 +92,7 @@ static mask_fields read_mask(reader *in) {
     return mask;
 }
 
-static void read_sets(reader *in, std::vector<mask_set> *sets) {
+void read_sets(reader *in, std::vector<mask_set> *sets) {
     const uint32_t elements = in->count(16, "mask count");
     for (uint32_t i = 0; i < elements && in->missed.empty(); i++) {
         mask_set set;
@@ -106,7 +108,7 @@ static void read_sets(reader *in, std::vector<mask_set> *sets) {
     }
 }
 
-static void read_marks(reader *in, bool with_change, std::vector<router_mark> *marks) {
+void read_marks(reader *in, bool with_change, std::vector<router_mark> *marks) {
     const uint32_t count = in->count(with_change ? 12 : 8, "router count");
     for (uint32_t i = 0; i < count; i++) {
         router_mark mark = {};
@@ -118,19 +120,19 @@ static void read_marks(reader *in, bool with_change, std::vector<router_mark> *m
     }
 }
 
-static void read_addresses(reader *in, std::vector<address> *list) {
+void read_addresses(reader *in, std::vector<address> *list) {
     const uint32_t count = in->count(4, "appliance count");
     for (uint32_t i = 0; i < count; i++)
         list->push_back(in->u32("appliance"));
 }
 
-static void read_identity(reader *in, incoming *message) {
+void read_identity(reader *in, incoming *message) {
     here_i_am &hello = message->hello;
     hello.id = in->u32("identity");
     if (in->u16("hash revision") != 0)
         in->missed = "hash revision is not 0";
-    hello.mask_form = (in->u16("identity flags") & 2) != 0;
-    if (hello.mask_form) {
+    hello.mask_format = (in->u16("identity flags") & 2) != 0;
+    if (hello.mask_format) {
         std::vector<mask_set> sets;
         read_sets(in, &sets);
         if (!sets.empty())
@@ -142,13 +144,13 @@ static void read_identity(reader *in, incoming *message) {
     (void)in->u16("status");
 }
 
-static void read_view(reader *in, incoming *message) {
+void read_view(reader *in, incoming *message) {
     message->hello.change_number = in->u32("change number");
     read_marks(in, false, &message->hello.routers);
     read_addresses(in, &message->hello.appliances);
 }
 
-static void read_capabilities(reader *in, incoming *message) {
+void read_capabilities(reader *in, incoming *message) {
     while (in->left > 0 && in->missed.empty()) {
         const uint16_t type = in->u16("capability");
         if (in->u16("capability length") != 4 && in->missed.empty())
@@ -164,7 +166,7 @@ static void read_capabilities(reader *in, incoming *message) {
     }
 }
 
-static void read_command(reader *in, incoming *message) {
+void read_command(reader *in, incoming *message) {
     command_info command = {};
     command.command = in->u16("command");
     if (in->u16("command length") != 4 && in->missed.empty())
@@ -173,7 +175,7 @@ static void read_command(reader *in, incoming *message) {
     message->hello.command = command;
 }
 
-static void read_assignment(reader *in, incoming *message) {
+void read_assignment(reader *in, incoming *message) {
     redirect_assign &assign = message->assign;
     assign.key = in->u32("key");
     assign.key_change = in->u32("key change number");
@@ -186,11 +188,11 @@ static void read_assignment(reader *in, incoming *message) {
     for (uint8_t &bucket : assign.buckets) {
         bucket = in->u8("bucket");
         if (in->missed.empty() && bucket != NO_APPLIANCE && bucket >= assign.appliances.size())
-            in->missed = "a bucket names no appliance of the list";
+            in->missed = "a bucket's appliance is not in the list";
     }
 }
 
-static void read_mask_assignment(reader *in, incoming *message) {
+void read_mask_assignment(reader *in, incoming *message) {
     message->assign.by_mask = true;
     if (in->u16("assignment type") != 1 && in->missed.empty())
         in->missed = "assignment type is not 1";
@@ -216,18 +218,18 @@ constexpr component_reader COMPONENT_READERS[] = {
     {REDIRECT_ASSIGN, MASK_ASSIGNMENT, false, "mask assignment", read_mask_assignment},
 };
 
-static std::string read_security(const bytes &data, std::string_view password, reader *in) {
+std::string read_security(const bytes &data, std::string_view password, reader *in) {
     const uint16_t type = in->u16("security type");
     const uint16_t length = in->u16("security length");
     const uint32_t option = in->u32("security option");
     if (!in->missed.empty())
         return in->missed;
     if (type != SECURITY_INFO)
-        return "the first component is no Security Info";
+        return "the first component is not Security Info";
     if (length != (option == 1 ? 4 + MD5_DIGEST_BYTES : 4))
         return "length of the Security Info";
     if ((option == 1) != !password.empty())
-        return option == 1 ? "signed, and there is no password here" : "not signed";
+        return option == 1 ? "signed, but this router has no password" : "not signed";
     if (option == 1) {
         if (!in->want(MD5_DIGEST_BYTES, "digest"))
             return in->missed;
@@ -239,7 +241,7 @@ static std::string read_security(const bytes &data, std::string_view password, r
     return "";
 }
 
-static std::string read_service(reader *in, service_info *service) {
+std::string read_service(reader *in, service_info *service) {
     const uint16_t type = in->u16("service component");
     const uint16_t length = in->u16("service length");
     service->type = in->u8("service type");
@@ -252,9 +254,11 @@ static std::string read_service(reader *in, service_info *service) {
     if (!in->missed.empty())
         return in->missed;
     if (type != SERVICE_INFO || length != 24)
-        return "the second component is no Service Info";
+        return "the second component is not Service Info";
     return "";
 }
+
+} // namespace
 
 std::string read_message(const bytes &data, std::string_view password, incoming *message) {
     *message = {};
@@ -267,8 +271,8 @@ std::string read_message(const bytes &data, std::string_view password, incoming 
     if (version != VERSION)
         return "version is not 2";
     if (length != in.left)
-        return "message length is " + std::to_string(length) + ", and " + std::to_string(in.left) +
-               " bytes came";
+        return "message length is " + std::to_string(length) + ", but " + std::to_string(in.left) +
+               " bytes follow";
     if (message->type != HERE_I_AM && message->type != REDIRECT_ASSIGN)
         return "message type " + std::to_string(message->type) + " is not for a router";
     std::string wrong = read_security(data, password, &in);
@@ -295,7 +299,7 @@ std::string read_message(const bytes &data, std::string_view password, incoming 
             if (!inside.missed.empty())
                 return std::string(row.name) + ": " + inside.missed;
             if (inside.left > 0)
-                return std::string(row.name) + ": bytes behind its end";
+                return std::string(row.name) + ": bytes after its end";
         }
     }
     for (const component_reader &row : COMPONENT_READERS)
@@ -306,7 +310,9 @@ std::string read_message(const bytes &data, std::string_view password, incoming 
     return "";
 }
 
-// ---- writing
+// --- Writing
+
+namespace {
 
 struct writer {
     bytes out;
@@ -332,14 +338,14 @@ struct writer {
     }
 };
 
-static void write_mask(writer *to, const mask_fields &mask) {
+void write_mask(writer *to, const mask_fields &mask) {
     to->u32(mask.src_ip);
     to->u32(mask.dst_ip);
     to->u16(mask.src_port);
     to->u16(mask.dst_port);
 }
 
-static void write_head(writer *to, uint32_t type, const service_info &service, std::string_view password) {
+void write_head(writer *to, uint32_t type, const service_info &service, std::string_view password) {
     to->u32(type);
     to->u16(VERSION);
     to->u16(0);
@@ -359,20 +365,7 @@ static void write_head(writer *to, uint32_t type, const service_info &service, s
     to->end(began);
 }
 
-static bytes finish(writer *to, std::string_view password) {
-    to->end(HEADER_BYTES);
-    sign(&to->out, password);
-    return std::move(to->out);
-}
-
-void sign(bytes *message, std::string_view password) {
-    if (message->size() < DIGEST_PLACE + MD5_DIGEST_BYTES || (*message)[DIGEST_PLACE - 1] != 1)
-        return;
-    const auto digest = digest_of(*message, password);
-    std::copy(digest.begin(), digest.end(), message->begin() + DIGEST_PLACE);
-}
-
-static void write_element(writer *to, const view_element &element) {
+void write_element(writer *to, const view_element &element) {
     to->u32(element.id);
     to->u16(element.revision);
     to->u16(element.flags);
@@ -387,6 +380,21 @@ static void write_element(writer *to, const view_element &element) {
     }
     to->u16(element.weight);
     to->u16(0); // status
+}
+
+bytes finish_message(writer *to, std::string_view password) {
+    to->end(HEADER_BYTES);
+    sign_message(&to->out, password);
+    return std::move(to->out);
+}
+
+} // namespace
+
+void sign_message(bytes *message, std::string_view password) {
+    if (message->size() < DIGEST_OFFSET + MD5_DIGEST_BYTES || (*message)[DIGEST_OFFSET - 1] != 1)
+        return;
+    const auto digest = digest_of(*message, password);
+    std::copy(digest.begin(), digest.end(), message->begin() + DIGEST_OFFSET);
 }
 
 bytes write_message(const i_see_you &message, std::string_view password) {
@@ -449,7 +457,7 @@ bytes write_message(const i_see_you &message, std::string_view password) {
         to.u32(message.command->data);
         to.end(began);
     }
-    return finish(&to, password);
+    return finish_message(&to, password);
 }
 
 bytes write_message(const removal_query &message, std::string_view password) {
@@ -461,7 +469,7 @@ bytes write_message(const removal_query &message, std::string_view password) {
     to.u32(message.sent_to);
     to.u32(message.target);
     to.end(began);
-    return finish(&to, password);
+    return finish_message(&to, password);
 }
 
 } // namespace lab

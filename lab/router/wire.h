@@ -1,8 +1,8 @@
-// The router's side of WCCP version 2 on the wire: what it reads from appliances, what it writes to them. It
-// knows nothing of the engine's layouts, on purpose: a mistake made twice in one place would go unseen.
+// The router's side of WCCP version 2 on the wire: parses messages of appliances and writes those of a
+// router. It shares no code with the engine on purpose, so that a mistake in a layout does not cancel itself
+// out.
 //
-// Addresses, ids and counts are in host order here; bytes are swapped where they are read and written,
-// nowhere else.
+// Addresses, ids and counts are in host byte order. Only the reader and the writer in wire.cpp swap bytes.
 #pragma once
 
 #include <array>
@@ -37,7 +37,7 @@ enum : uint16_t { COMMAND_SHUTDOWN = 1, COMMAND_SHUTDOWN_SEEN = 2 };
 constexpr uint16_t VERSION = 0x0200;
 constexpr size_t MOST_IN_VIEW = 32;
 constexpr size_t BUCKETS = 256;
-constexpr uint8_t NO_APPLIANCE = 0xff; // a bucket of an assignment that belongs to nobody
+constexpr uint8_t NO_APPLIANCE = 0xff; // in an assignment: the bucket has no owner
 
 struct service_info {
     uint8_t type, id, priority, protocol;
@@ -45,8 +45,7 @@ struct service_info {
     std::array<uint16_t, 8> ports;
     bool operator==(const service_info &) const = default;
 };
-// Codes: forwarding and return 1 GRE, 2 L2; assignment 1 hash, 2 mask. As an offer, bit 0 is code 1 and bit 1
-// code 2.
+// Forwarding and return: 1 GRE, 2 L2. Assignment: 1 hash, 2 mask. An offer is a bit set of these codes.
 struct methods {
     uint32_t forward = 1, assign = 1, giveback = 1;
     bool operator==(const methods &) const = default;
@@ -64,7 +63,7 @@ struct mask_set {
     mask_fields mask;
     std::vector<mask_value> values;
 };
-// What an appliance says of a router: the ids that it saw last.
+// The last ids that an appliance has received from a router.
 struct router_mark {
     address router;
     uint32_t receive_id;
@@ -77,7 +76,7 @@ struct command_info {
 
 struct here_i_am {
     address id = 0;
-    bool mask_form = false;
+    bool mask_format = false;
     mask_fields mask;
     uint16_t weight = 0;
     uint32_t change_number = 0;
@@ -92,7 +91,7 @@ struct redirect_assign {
     bool by_mask = false;
     std::vector<router_mark> routers;
     std::vector<address> appliances;           // hash
-    std::array<uint8_t, BUCKETS> buckets = {}; // hash: places in the list above
+    std::array<uint8_t, BUCKETS> buckets = {}; // hash: indexes into `appliances`
     std::vector<mask_set> sets;                // mask
 };
 struct incoming {
@@ -102,15 +101,15 @@ struct incoming {
     redirect_assign assign;
 };
 
-// Empty when the message is sound and addressed to a router with this password (none: empty); else what is
-// wrong.
+// Parses a message to a router that has this password ("": none). The result is empty, or says what is wrong
+// with the message.
 std::string read_message(const bytes &data, std::string_view password, incoming *message);
 
 struct view_element {
     address id = 0;
     uint16_t revision = 0;
-    uint16_t flags = 0;    // bit 1: mask form; bit 0: not redirected to, by mask
-    bool is_short = false; // mask form of 16 bytes
+    uint16_t flags = 0;    // bit 1: mask format; bit 0: nothing is redirected to it by mask
+    bool is_short = false; // mask format of 16 bytes
     std::array<uint8_t, BUCKETS / 8> buckets = {};
     mask_fields mask;
     uint16_t weight = 0;
@@ -141,9 +140,9 @@ struct removal_query {
 bytes write_message(const i_see_you &message, std::string_view password);
 bytes write_message(const removal_query &message, std::string_view password);
 
-// The digest, computed anew over a message that has been tampered with. Nothing happens without a Security
-// Info that has one.
-void sign(bytes *message, std::string_view password);
+// Computes the digest of a complete message, for example after it was tampered with. Does nothing if the
+// message has no digest.
+void sign_message(bytes *message, std::string_view password);
 
 std::string text_of(address a);
 std::optional<address> address_of(const std::string &text);

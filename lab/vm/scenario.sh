@@ -10,12 +10,12 @@ figure() { # TEXT : a measured value, on the console and with the results
 # A server in the appliance, which flows reach by GRE. The router's side is a GRE link of its kernel, which the simulated
 # router would slow down.
 sink_by_gre() {
-    start --forward gre --return gre
+    start_traffic --forward gre --return gre
     lab_appliance a1 10.0.0.101
     lab_gateway a1 10.0.0.1
     lab_start a1 sink "$WCCP_BIN/wccp_router" web --port 3129
     lab_appliance_start a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
-    ready 51 a1
+    wait_ready 51 a1
     lab_in r1 bash -ec '
         ip link add gre1 type gre local 10.0.0.1 remote 10.0.0.101 ttl 64 nopmtudisc ignore-df
         echo 1 >/proc/sys/net/ipv6/conf/gre1/disable_ipv6
@@ -57,7 +57,7 @@ case_throughput() {
         "$(median_of "${direct[@]}") of delivery to a socket (medians of ${#ratios[@]} pairs)"
     [ "$(jq -n "$(median_of "${ratios[@]}") >= 0.9")" = true ] || die "too slow: ${ratios[*]}"
     # All of it was carried, and none of it given back.
-    state_is a1 10 tunnel ".[] | .bytes_in >= 300000000 and .packets_out == 0"
+    tunneld_is a1 10 tunnel ".[] | .bytes_in >= 300000000 and .packets_out == 0"
     lab_stop a1 sink
     finish a1
 }
@@ -76,7 +76,7 @@ case_large() {
     size=$(lab_in a1 ip -j -s link show eth0 | jq '.[0].stats64.rx | .bytes / .packets | round')
     figure "uploaded in packets of $size bytes, $(jq -n "$carried / 1e6 | round") MB/s"
     [ "$size" -gt 3000 ] || die "none of them is large"
-    state_is a1 10 tunnel '.[] | .bytes_in > 20000000 and ([.refused[]?] | add // 0) == 0'
+    tunneld_is a1 10 tunnel '.[] | .bytes_in > 20000000 and ([.refused[]?] | add // 0) == 0'
     lab_stop a1 sink
     finish a1
 }
@@ -84,12 +84,12 @@ case_large() {
 # The life of an appliance: each form of GRE, a bypass, its proxy down and up again, each of its programs killed, and a
 # reboot. What is in the kernel is the same after each loss, and flows go on.
 case_life() {
-    start --forward gre --return gre
+    start_traffic --forward gre --return gre
     saved
     lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 interval=1 fall=2 rise=1 leave_after=3)"
     lab_supervise a1
-    role a1 60 51 ACTIVE
-    ready 51 a1
+    wait_role a1 60 51 ACTIVE
+    wait_ready 51 a1
     local form before wccpd
     for form in plain ip redirect; do
         lab_ctl r1 gre $form >/dev/null
@@ -105,7 +105,7 @@ case_life() {
     router_is r1 30 51 '$g.appliances == []'
     fetches "$direct" --count 4
     lab_proxy a1
-    ready 51 a1
+    wait_ready 51 a1
     fetches_within 5 "$(by a1)" --count 2
 
     wccpd=$(lab_in a1 pgrep -x wccpd)
@@ -117,8 +117,8 @@ case_life() {
     lab_in a1 pkill -KILL -x wccpd
     fetches_within 3 '.failed == 0' --count 4
     lab_wait_event 20 a1 '^process wccpd: .*starts again' || die "not seen to end"
-    says a1 60 'created GRE tunnel id'
-    ready 51 a1
+    wait_log a1 60 'created GRE tunnel id'
+    wait_ready 51 a1
     fetches "$(by a1)" --count 2
     same_in_kernel "$before"
 
@@ -126,8 +126,8 @@ case_life() {
     lab_wait_exit 5 a1 mgmtd
     fetches_within 3 '.failed == 0' --count 2
     lab_supervise a1
-    role a1 60 51 ACTIVE
-    ready 51 a1
+    wait_role a1 60 51 ACTIVE
+    wait_ready 51 a1
     fetches "$bypassed" --count 4 --sources 4
     same_in_kernel "$before"
     sync
@@ -135,11 +135,11 @@ case_life() {
 }
 bypassed='.failed == 0 and .proxies == {"": 2, "a1": 2}'
 case_after_reboot() {
-    start --forward gre --return gre
+    start_traffic --forward gre --return gre
     saved
     lab_supervise a1
-    role a1 60 51 ACTIVE
-    ready 51 a1
+    wait_role a1 60 51 ACTIVE
+    wait_ready 51 a1
     fetches "$bypassed" --count 4 --sources 4
     fetches "$direct" --count 4 --port 8080
     lab_stop a1 mgmtd || die "mgmtd ended with $?"
