@@ -1,6 +1,6 @@
-// What the engine computes by itself: the designated appliance's table, a tick of all groups, and the views
-// of one I-See-You that says what the last one said. Each figure comes with its ratio to a floor measured in
-// the same run: work that nobody could leave out.
+// Benchmarks of the engine: the table of the designated appliance, a tick of all groups, and the views of an
+// I-See-You without changes. Each figure has a ratio to a floor, measured in the same run: work that no
+// implementation could leave out.
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
@@ -23,38 +23,38 @@
 
 namespace {
 
-// Of this thread's processor time, so that a busy machine doesn't show.
-double seconds() {
+// Processor time of this thread, which does not depend on the load of the machine.
+double thread_seconds() {
     timespec now;
     clock_gettime(CLOCK_THREAD_CPUTIME_ID, &now);
     return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) * 1e-9;
 }
 
-// The best of some rounds.
+// Seconds per call, in the best of some rounds.
 template <typename Work>
-double seconds_each(Work work) {
+double measure_best(Work work) {
     double best = 1e9;
     for (int round = 0; round < 7; round++) {
         uint64_t calls = 0;
-        const double begin = seconds();
+        const double begin = thread_seconds();
         do {
             for (int i = 0; i < 16; i++)
                 work();
             calls += 16;
-        } while ((seconds() - begin) < 0.01);
-        best = std::min(best, (seconds() - begin) / static_cast<double>(calls));
+        } while ((thread_seconds() - begin) < 0.01);
+        best = std::min(best, (thread_seconds() - begin) / static_cast<double>(calls));
     }
     return best;
 }
 
-// Runs the benchmark's loop, and reports how many floors one turn costs.
+// Runs the benchmark's loop and reports the ratio of its time to the floor.
 template <typename Work>
 void run_against(benchmark::State &state, double floor, Work work) {
     G_log_level = LC_LOG_EMERG;
-    const double begin = seconds();
+    const double begin = thread_seconds();
     for (auto _ : state)
         work();
-    const double each = (seconds() - begin) / static_cast<double>(state.iterations());
+    const double each = (thread_seconds() - begin) / static_cast<double>(state.iterations());
     state.counters["floor_ns"] = floor * 1e9;
     state.counters["x_floor"] = each / floor;
 }
@@ -69,8 +69,8 @@ wccp_service_group *group_with_appliances(const reported_group &shared, uint32_t
     return group;
 }
 
-// 32 appliances, one of which has just gone. The floor: the same entries sorted and a table written once.
-void table(benchmark::State &state, uint32_t method) {
+// 32 appliances, one of which has just left. The floor: sorting the same entries and writing a table once.
+void compute_table(benchmark::State &state, uint32_t method) {
     const reported_group shared(false);
     wccp_service_group *group = group_with_appliances(shared, method);
     std::vector<wccp_view_appliance> appliances(WCCP_MAX_APPLIANCES);
@@ -88,7 +88,7 @@ void table(benchmark::State &state, uint32_t method) {
     memcpy(before, group->dsg_appliances, sizeof before);
     const uint32_t slots = group->bucket_count;
 
-    const double floor = seconds_each([&] {
+    const double floor = measure_best([&] {
         wccp_dsg_appliance entries[WCCP_MAX_APPLIANCES];
         memcpy(entries, before, sizeof entries);
         qsort(entries, WCCP_MAX_APPLIANCES, sizeof entries[0], [](const void *a, const void *b) {
@@ -108,10 +108,10 @@ void table(benchmark::State &state, uint32_t method) {
     });
 }
 void table_of_256_hash_buckets(benchmark::State &state) {
-    table(state, WCCP_ASSIGN_HASH);
+    compute_table(state, WCCP_ASSIGN_HASH);
 }
 void table_of_128_mask_values(benchmark::State &state) {
-    table(state, WCCP_ASSIGN_MASK);
+    compute_table(state, WCCP_ASSIGN_MASK);
 }
 BENCHMARK(table_of_256_hash_buckets);
 BENCHMARK(table_of_128_mask_values);
@@ -127,8 +127,8 @@ double resident_kb() {
     return static_cast<double>(resident) * 4;
 }
 
-// 256 groups of 32 routers, each tick with its share of Here-I-Am messages (built, not sent) and sweeps. The
-// floor: one look at each router.
+// 256 groups of 32 routers; each tick builds some Here-I-Am messages, without sending them, and sweeps some
+// groups. The floor: reading a field of each router.
 void tick_of_256_groups(benchmark::State &state) {
     std::vector<std::unique_ptr<reported_group>> groups;
     std::vector<be32> routers;
@@ -137,7 +137,7 @@ void tick_of_256_groups(benchmark::State &state) {
         routers.push_back(host(i + 200));
         appliances.push_back({host(i + 1), 100});
     }
-    // Told by the first call: what a later one takes has been freed by the one before it.
+    // Valid in the first call only: later ones reuse memory that it has freed.
     static const double before = resident_kb();
     static double with_1_group, with_256_groups;
     for (uint32_t id = 0; id < WCCP_MAX_GROUPS; id++) {
@@ -155,20 +155,20 @@ void tick_of_256_groups(benchmark::State &state) {
     state.counters["kB_with_256_groups"] = with_256_groups;
     G_log_level = LC_LOG_EMERG;
     pass_seconds(1); // the elections
-    const double floor = seconds_each([] {
+    const double floor = measure_best([] {
         for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
             for (wccp_sending_router *router = group->sending_routers; router; router = router->next)
                 benchmark::DoNotOptimize(router->last_icu_time);
     });
     run_against(state, floor, [] {
         wccp_tick();
-        wccp_g.seconds--; // or the routers would go
+        wccp_g.seconds--; // so that the routers don't time out
     });
 }
 BENCHMARK(tick_of_256_groups)->Unit(benchmark::kMicrosecond);
 
-// Router view, web-cache elements and redirect status of 32 routers and 32 appliances, nothing new in them.
-// The floor: MD5 over the message that brings them.
+// Router view, web-cache elements and redirect status of 32 routers and 32 appliances, all unchanged. The
+// floor: the MD5 of the message.
 void views_of_an_unchanged_report(benchmark::State &state) {
     const reported_group shared(false);
     wccp_service_group *group = shared.group;
@@ -195,7 +195,7 @@ void views_of_an_unchanged_report(benchmark::State &state) {
     };
     take();
     std::vector<uint8_t> message(8 + 24 + 28 + 20 + 24 + 32 * 4 + 32 * 44, 0x5a);
-    const double floor = seconds_each([&] {
+    const double floor = measure_best([&] {
         md5_state md5;
         uint8_t digest[16];
         md5_init(&md5);

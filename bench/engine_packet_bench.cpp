@@ -1,11 +1,11 @@
-// What a packet costs: an I-See-You of 32 routers and 32 appliances in steady state through the message loop,
-// and the two messages that this appliance builds, at their largest. Each figure comes with its ratio to a
-// floor that is measured alternately with it: the least that has to be done with the same bytes. The ratio is
-// between the fastest rounds of both, so that a busy machine doesn't show in it.
+// Benchmarks of packets: processing an I-See-You of 32 routers and 32 appliances without changes, and
+// building the two messages of an appliance, at their largest. Each figure has a ratio to a floor, the least
+// work that the same bytes require. Both are measured alternately, and the ratio is that of the fastest
+// rounds, so that it does not depend on the load of the machine.
 //
-// Then the most expensive I-See-You: each of its weights has changed, so that the designated appliance
-// computes its table 32 times, in a group in which nearly a thousand appliances are listed by one router
-// only. Every line below debug level is logged, to a log daemon that reads.
+// Then the most expensive I-See-You: all of its weights have changed, and therefore the designated appliance
+// computes its table 32 times, in a group with nearly a thousand appliances that only one router lists. Log
+// lines go to a log daemon.
 
 #include <benchmark/benchmark.h>
 
@@ -37,10 +37,9 @@ double seconds_of_round(Work work) {
     return std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
 }
 
-// One iteration is a round of the work and a round of its floor; the time reported is that of one piece of
-// work.
+// Each iteration is a round of the work and a round of the floor. The reported time is that of one call.
 template <typename Work, typename Floor>
-void measure(benchmark::State &state, Work work, Floor floor) {
+void measure_with_floor(benchmark::State &state, Work work, Floor floor) {
     double best = 1e9, best_floor = 1e9;
     for (auto _ : state) {
         const double time = seconds_of_round(work), floor_time = seconds_of_round(floor);
@@ -53,7 +52,6 @@ void measure(benchmark::State &state, Work work, Floor floor) {
     state.counters["ratio"] = best / best_floor;
 }
 
-// Reads every byte once.
 uint64_t read_once(const uint8_t *bytes, size_t count) {
     uint64_t sum = 0;
     for (size_t i = 0; i < count; i++)
@@ -80,8 +78,8 @@ struct full_group {
     reported_appliances appliances;
 };
 
-// The I-See-You of the last router, with the hash buckets of 32 appliances, 10.0.<third>.1 and so on.
-std::vector<uint8_t> icu(bool digested, uint32_t third, uint32_t weight) {
+// The I-See-You of the last router, with the hash buckets of 32 appliances, 10.0.<third>.1 and following.
+std::vector<uint8_t> make_i_see_you(bool digested, uint32_t third, uint32_t weight) {
     wire_bytes security =
         wire_bytes().u16(0).u16(digested ? 20 : 4).u32(digested ? 1 : 0).zeros(digested ? 16 : 0);
     wire_bytes service = wire_bytes().u16(1).u16(24).u8(1).u8(51).zeros(22);
@@ -97,7 +95,7 @@ std::vector<uint8_t> icu(bool digested, uint32_t third, uint32_t weight) {
     return wire_message(11, {security, service, identity, view, capabilities});
 }
 
-std::unique_ptr<wccp_pkt> received(const std::vector<uint8_t> &message) {
+std::unique_ptr<wccp_pkt> make_packet(const std::vector<uint8_t> &message) {
     auto pkt = std::make_unique<wccp_pkt>();
     memcpy(pkt->data, message.data(), message.size());
     pkt->length = static_cast<uint32_t>(message.size());
@@ -107,8 +105,8 @@ std::unique_ptr<wccp_pkt> received(const std::vector<uint8_t> &message) {
 void i_see_you(benchmark::State &state, bool digested) {
     const full_group full(digested, WCCP_ASSIGN_HASH);
     const wccp_service_group *group = full.reported.group;
-    const std::vector<uint8_t> message = icu(digested, 0, 100);
-    const auto pkt = received(message);
+    const std::vector<uint8_t> message = make_i_see_you(digested, 0, 100);
+    const auto pkt = make_packet(message);
     uint8_t digest[MD5_DIGEST_BYTES];
     wccp_pkt_digest(group, pkt.get(), digest);
     const auto process = [&] {
@@ -121,7 +119,7 @@ void i_see_you(benchmark::State &state, bool digested) {
     process();
     const uint32_t settled = group->change_number, before = group->rx_icus;
     if (digested)
-        measure(state, process, [&] {
+        measure_with_floor(state, process, [&] {
             uint8_t out[MD5_DIGEST_BYTES];
             md5_state md5;
             md5_init(&md5);
@@ -130,11 +128,12 @@ void i_see_you(benchmark::State &state, bool digested) {
             benchmark::DoNotOptimize(out);
         });
     else
-        measure(state, process, [&] { benchmark::DoNotOptimize(read_once(message.data(), message.size())); });
+        measure_with_floor(state, process,
+                           [&] { benchmark::DoNotOptimize(read_once(message.data(), message.size())); });
     state.counters["bytes"] = static_cast<double>(message.size());
     if (group->rx_icus == before || group->rx_icu_failures || wccp_g.rx_failures ||
         group->change_number != settled)
-        state.SkipWithError("the message was not taken as it should be");
+        state.SkipWithError("the message was not processed");
 }
 
 void build(benchmark::State &state, int (*builder)(wccp_service_group *, wccp_pkt *), uint32_t assign_method,
@@ -153,13 +152,13 @@ void build(benchmark::State &state, int (*builder)(wccp_service_group *, wccp_pk
     };
     const auto copy = std::make_unique<wccp_pkt>();
     if (digested)
-        measure(state, write, [&] {
+        measure_with_floor(state, write, [&] {
             uint8_t out[MD5_DIGEST_BYTES];
             wccp_pkt_digest(group, pkt.get(), out);
             benchmark::DoNotOptimize(out);
         });
     else
-        measure(state, write, [&] {
+        measure_with_floor(state, write, [&] {
             memset(copy.get(), 0, sizeof *copy);
             memcpy(copy.get(), pkt.get(), pkt->length);
             benchmark::DoNotOptimize(copy->data);
@@ -169,7 +168,7 @@ void build(benchmark::State &state, int (*builder)(wccp_service_group *, wccp_pk
         state.SkipWithError("the message was not built");
 }
 
-// Takes /dev/log, reads and counts what comes.
+// Binds /dev/log and counts lines.
 struct reading_log_daemon {
     explicit reading_log_daemon(int32_t level) {
         lc_log_init("wccpd", "wccpd", 0, 0x1060000, LC_LOG_INFO, 128, 1);
@@ -211,8 +210,8 @@ void i_see_you_with_32_changed_weights(benchmark::State &state, int32_t level) {
     const reading_log_daemon log(level);
     wccp_tick(); // elects
     std::vector<std::unique_ptr<wccp_pkt>> messages;
-    for (const uint32_t weight : {101, 100})
-        messages.push_back(received(icu(false, 32, weight)));
+    for (const uint32_t weight : {101u, 100u})
+        messages.push_back(make_packet(make_i_see_you(false, 32, weight)));
     const uint32_t key = group->dsg_key_change;
     const uint64_t lines = log.lines;
     std::vector<double> times;
@@ -233,33 +232,34 @@ void i_see_you_with_32_changed_weights(benchmark::State &state, int32_t level) {
     state.counters["lines"] = static_cast<double>(log.lines - lines) / count;
     if (group->rx_icu_failures || group->appliance_view_count != 993 ||
         group->dsg_key_change != key + 32 * times.size())
-        state.SkipWithError("the message was not taken as it should be");
+        state.SkipWithError("the message was not processed");
+}
+
+void set_rounds(benchmark::internal::Benchmark *each) {
+    each->UseManualTime()->Iterations(300);
+}
+void set_messages(benchmark::internal::Benchmark *each) {
+    each->UseManualTime()->Iterations(200)->Unit(benchmark::kMillisecond);
 }
 
 } // namespace
 
-static void rounds(benchmark::internal::Benchmark *each) {
-    each->UseManualTime()->Iterations(300);
-}
-BENCHMARK_CAPTURE(i_see_you, md5_floor_md5_of_the_bytes, true)->Apply(rounds);
-BENCHMARK_CAPTURE(i_see_you, plain_floor_reading_once, false)->Apply(rounds);
+BENCHMARK_CAPTURE(i_see_you, md5_floor_md5_of_the_bytes, true)->Apply(set_rounds);
+BENCHMARK_CAPTURE(i_see_you, plain_floor_reading_once, false)->Apply(set_rounds);
 BENCHMARK_CAPTURE(build, here_i_am_md5_floor_md5, wccp_pkt_build_here_i_am, WCCP_ASSIGN_HASH, true)
-    ->Apply(rounds);
+    ->Apply(set_rounds);
 BENCHMARK_CAPTURE(build, here_i_am_floor_copying, wccp_pkt_build_here_i_am, WCCP_ASSIGN_HASH, false)
-    ->Apply(rounds);
+    ->Apply(set_rounds);
 BENCHMARK_CAPTURE(build, redirect_assign_hash_floor_copying, wccp_pkt_build_redirect_assign, WCCP_ASSIGN_HASH,
                   false)
-    ->Apply(rounds);
+    ->Apply(set_rounds);
 BENCHMARK_CAPTURE(build, redirect_assign_mask_floor_copying, wccp_pkt_build_redirect_assign, WCCP_ASSIGN_MASK,
                   false)
-    ->Apply(rounds);
+    ->Apply(set_rounds);
 BENCHMARK_CAPTURE(build, redirect_assign_mask_md5_floor_md5, wccp_pkt_build_redirect_assign, WCCP_ASSIGN_MASK,
                   true)
-    ->Apply(rounds);
-static void messages(benchmark::internal::Benchmark *each) {
-    each->UseManualTime()->Iterations(200)->Unit(benchmark::kMillisecond);
-}
-BENCHMARK_CAPTURE(i_see_you_with_32_changed_weights, notice, LC_LOG_NOTICE)->Apply(messages);
-BENCHMARK_CAPTURE(i_see_you_with_32_changed_weights, info, LC_LOG_INFO)->Apply(messages);
+    ->Apply(set_rounds);
+BENCHMARK_CAPTURE(i_see_you_with_32_changed_weights, notice, LC_LOG_NOTICE)->Apply(set_messages);
+BENCHMARK_CAPTURE(i_see_you_with_32_changed_weights, info, LC_LOG_INFO)->Apply(set_messages);
 
 BENCHMARK_MAIN();

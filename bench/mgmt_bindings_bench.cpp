@@ -1,5 +1,5 @@
-// Looking up nodes in an array of 10,000 bindings, and what a binding costs from and to the wire. The floor
-// of a look-up is the hash of the name, that of the wire the copying of its bytes.
+// Benchmarks of bindings: looking up nodes in an array of 10,000, and writing an attribute to the wire and
+// reading it. The floor of a look-up is the hash of the name, that of the attribute a copy of its bytes.
 #include <benchmark/benchmark.h>
 
 #include <algorithm>
@@ -10,6 +10,8 @@
 
 #include "mgmt/bnode.h"
 #include "runtime/hash_table.h"
+
+namespace {
 
 struct configuration {
     bn_binding_array *array = nullptr;
@@ -32,7 +34,7 @@ struct configuration {
     ~configuration() { (void)bn_binding_array_free(&array); }
 };
 
-static void look_up_by_name(benchmark::State &state) {
+void look_up_by_name(benchmark::State &state) {
     const configuration all(state.range(0) != 0);
     size_t i = 0;
     for (auto _ : state) {
@@ -44,7 +46,7 @@ static void look_up_by_name(benchmark::State &state) {
 }
 BENCHMARK(look_up_by_name)->ArgName("sorted")->Arg(0)->Arg(1);
 
-static void floor_hash_of_name(benchmark::State &state) {
+void floor_hash_of_name(benchmark::State &state) {
     const configuration all(false);
     size_t i = 0;
     for (auto _ : state) {
@@ -54,7 +56,7 @@ static void floor_hash_of_name(benchmark::State &state) {
 }
 BENCHMARK(floor_hash_of_name);
 
-static void look_up_by_pattern(benchmark::State &state) {
+void look_up_by_pattern(benchmark::State &state) {
     const configuration all(state.range(0) != 0);
     for (auto _ : state) {
         tstr_array *parts = nullptr;
@@ -66,7 +68,7 @@ static void look_up_by_pattern(benchmark::State &state) {
 }
 BENCHMARK(look_up_by_pattern)->ArgName("sorted")->Arg(0)->Arg(1);
 
-static void split_name(benchmark::State &state) {
+void split_name(benchmark::State &state) {
     for (auto _ : state) {
         tstr_array *parts = nullptr;
         int absolute = 0;
@@ -77,7 +79,7 @@ static void split_name(benchmark::State &state) {
 }
 BENCHMARK(split_name);
 
-static void attribute_there_and_back(benchmark::State &state) {
+void write_and_read_attribute(benchmark::State &state) {
     bn_attrib *attrib = nullptr;
     tbuffer *buffer = nullptr;
     (void)bn_attrib_new_str(&attrib, bn_attrib_value, bn_type_str, 0, "a value of some length");
@@ -93,9 +95,9 @@ static void attribute_there_and_back(benchmark::State &state) {
     (void)bn_attrib_free(&attrib);
     (void)tb_free(&buffer);
 }
-BENCHMARK(attribute_there_and_back);
+BENCHMARK(write_and_read_attribute);
 
-static void floor_copy_of_its_bytes(benchmark::State &state) {
+void floor_copy_of_its_bytes(benchmark::State &state) {
     char from[42] = {}, to[42];
     for (auto _ : state) {
         benchmark::DoNotOptimize(from);
@@ -104,5 +106,7 @@ static void floor_copy_of_its_bytes(benchmark::State &state) {
     }
 }
 BENCHMARK(floor_copy_of_its_bytes);
+
+} // namespace
 
 BENCHMARK_MAIN();

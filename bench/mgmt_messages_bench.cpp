@@ -1,6 +1,6 @@
-// Messages and bindings a second: writing, reading, a query with its answer over a real socket pair, and a
-// burst of small messages. The floor of each is sending and taking the same bytes over such a pair without
-// looking at them, measured in the same run, turn by turn; `x_floor` says how many times the floor it takes.
+// Benchmarks of management messages, in messages and bindings per second: writing, reading, a query with its
+// answer over a socket pair, and a burst of small messages. The floor of each is sending and receiving the
+// same number of bytes over a socket pair, measured alternately with it; `x_floor` is the ratio to the floor.
 #include <benchmark/benchmark.h>
 
 #include <cstdlib>
@@ -13,20 +13,20 @@
 
 namespace {
 
-// Of this thread, the kernel's part included, so that others on the machine don't count.
+// Processor time of this thread, including the kernel, which does not depend on the load of the machine.
 using seconds = double;
-seconds now() {
+seconds thread_time() {
     timespec time{};
     clock_gettime(CLOCK_THREAD_CPUTIME_ID, &time);
     return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9;
 }
 template <typename Step>
 seconds time_of(Step step) {
-    const seconds start = now();
+    const seconds start = thread_time();
     step();
-    return now() - start;
+    return thread_time() - start;
 }
-void must(bool condition, const char *what) {
+void require(bool condition, const char *what) {
     if (condition)
         return;
     fprintf(stderr, "%s\n", what);
@@ -36,17 +36,17 @@ void must(bool condition, const char *what) {
 struct socket_pair {
     int ends[2] = {-1, -1};
     std::string taken = std::string(1 << 18, '\0');
-    socket_pair() { must(socketpair(AF_UNIX, SOCK_STREAM, 0, ends) == 0, "socketpair"); }
+    socket_pair() { require(socketpair(AF_UNIX, SOCK_STREAM, 0, ends) == 0, "socketpair"); }
     ~socket_pair() {
         close(ends[0]);
         close(ends[1]);
     }
-    // The bytes go over, as much at a time as the socket holds.
-    void pass(int from, const void *bytes, size_t length) {
+    // Sends the bytes in pieces that fit into the socket, and receives them.
+    void transfer(int from, const void *bytes, size_t length) {
         const auto *at = static_cast<const char *>(bytes);
         while (length) {
             const size_t piece = length < 65536 ? length : 65536;
-            must(send(ends[from], at, piece, 0) == static_cast<ssize_t>(piece), "send");
+            require(send(ends[from], at, piece, 0) == static_cast<ssize_t>(piece), "send");
             for (size_t got = 0; got < piece;)
                 got += static_cast<size_t>(recv(ends[1 - from], taken.data(), piece - got, 0));
             at += piece;
@@ -56,31 +56,31 @@ struct socket_pair {
 };
 
 void fill_response(bn_response_msg **out, int64_t bindings) {
-    must(bn_query_response_msg_create(out, 1, 0, nullptr) == LC_OK, "create");
+    require(bn_query_response_msg_create(out, 1, 0, nullptr) == LC_OK, "create");
     (*out)->service_id = 2;
     for (int64_t i = 0; i < bindings; i++) {
         bn_binding *binding = nullptr;
         const std::string name =
             "/qv/wccpd/wccp/srv_grp/config/" + std::to_string(i / 40) + "/field/" + std::to_string(i % 40);
-        must(bn_binding_new_str(&binding, name.c_str(), bn_attrib_value, bn_type_str, 0, "a value") ==
-                     LC_OK &&
-                 bn_query_response_msg_append_binding_takeover(*out, &binding, 1000) == LC_OK,
-             "binding");
+        require(bn_binding_new_str(&binding, name.c_str(), bn_attrib_value, bn_type_str, 0, "a value") ==
+                        LC_OK &&
+                    bn_query_response_msg_append_binding_takeover(*out, &binding, 1000) == LC_OK,
+                "binding");
     }
 }
 
-// Runs `step` and passing `sent` bytes there and `back` bytes back in turns.
+// Measures `step` alternately with its floor: sending `sent` bytes and `back` bytes in the other direction.
 template <typename Step>
-void measure(benchmark::State &state, int64_t messages, int64_t bindings, size_t sent, size_t back,
-             Step step) {
+void measure_with_floor(benchmark::State &state, int64_t messages, int64_t bindings, size_t sent, size_t back,
+                        Step step) {
     socket_pair pair;
     const std::string bytes(sent > back ? sent : back, 'b');
     seconds own = 0, floor = 0;
     for (auto _ : state) {
         const seconds mine = time_of(step);
         floor += time_of([&] {
-            pair.pass(0, bytes.data(), sent);
-            pair.pass(1, bytes.data(), back);
+            pair.transfer(0, bytes.data(), sent);
+            pair.transfer(1, bytes.data(), back);
         });
         own += mine;
         state.SetIterationTime(mine);
@@ -98,8 +98,8 @@ void write_message(benchmark::State &state) {
     owned_response msg;
     owned_tbuffer first;
     fill_response(&msg.pointer, state.range(0));
-    must(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &first.pointer) == LC_OK, "write");
-    measure(state, 1, state.range(0), first.pointer->length, 0, [&] {
+    require(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &first.pointer) == LC_OK, "write");
+    measure_with_floor(state, 1, state.range(0), first.pointer->length, 0, [&] {
         owned_tbuffer buffer;
         (void)bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &buffer.pointer);
         benchmark::DoNotOptimize(buffer.pointer);
@@ -110,8 +110,8 @@ void read_message(benchmark::State &state) {
     owned_response msg;
     owned_tbuffer bytes;
     fill_response(&msg.pointer, state.range(0));
-    must(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &bytes.pointer) == LC_OK, "write");
-    measure(state, 1, state.range(0), bytes.pointer->length, 0, [&] {
+    require(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &bytes.pointer) == LC_OK, "write");
+    measure_with_floor(state, 1, state.range(0), bytes.pointer->length, 0, [&] {
         owned_response read;
         (void)bn_response_msg_deserialize(bytes.pointer, BN_FRAME_HEADER_BYTES, &read.pointer);
         benchmark::DoNotOptimize(read.pointer);
@@ -128,8 +128,8 @@ struct answered_session : hand_session {
         return LC_OK;
     }
     answered_session() {
-        must(bn_set_global_callback_query_response_msg(instance, take_answer, this) == LC_OK && open(),
-             "open");
+        require(bn_set_global_callback_query_response_msg(instance, take_answer, this) == LC_OK && open(),
+                "open");
     }
     void answer(const std::string &frames, int64_t messages) {
         answers = 0;
@@ -141,11 +141,11 @@ struct answered_session : hand_session {
             idle += at == frames.size();
             read();
         }
-        must(answers == messages, "an answer is missing");
+        require(answers == messages, "an answer is missing");
     }
     static std::string frame_of(bn_response_msg *msg) {
         owned_tbuffer bytes;
-        must(bn_response_msg_serialize(msg, 0, &bytes.pointer) == LC_OK, "write");
+        require(bn_response_msg_serialize(msg, 0, &bytes.pointer) == LC_OK, "write");
         return frame_bytes(
             BN_PROTO, msg->msg_type,
             std::string(reinterpret_cast<const char *>(tb_buf(bytes.pointer)), bytes.pointer->length));
@@ -169,10 +169,10 @@ void query_and_answer(benchmark::State &state) {
         with.answer(answer, 1);
     };
     ask();
-    measure(state, 2, state.range(0), sent, answer.size(), ask);
+    measure_with_floor(state, 2, state.range(0), sent, answer.size(), ask);
 }
 
-// Small messages that come together are taken out of one read.
+// Many small messages that arrive with one read.
 void burst(benchmark::State &state) {
     answered_session with;
     owned_response msg;
@@ -180,8 +180,8 @@ void burst(benchmark::State &state) {
     std::string frames;
     for (int64_t i = 0; i < state.range(0); i++)
         frames += answered_session::frame_of(msg.pointer);
-    measure(state, state.range(0), state.range(0), 0, frames.size(),
-            [&] { with.answer(frames, state.range(0)); });
+    measure_with_floor(state, state.range(0), state.range(0), 0, frames.size(),
+                       [&] { with.answer(frames, state.range(0)); });
 }
 
 #define SIZES ->ArgName("bindings")->Arg(1)->Arg(40)->Arg(1000)->UseManualTime()

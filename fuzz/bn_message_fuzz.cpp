@@ -1,9 +1,9 @@
-// The bodies of management messages, requests and responses, as a peer may have made them.
+// Fuzzer for the bodies of management messages, requests and responses.
 //
-// An input is a mode byte and then a message from its service id on. A message that can be read takes at most
-// eight times its bytes of memory, has attributes at valid ids only, and is the same when written and read
-// again. It is then given to everything that takes messages: readers by copy and by takeover, the dump, the
-// answer to a monitoring query, the change event and the walk by pattern.
+// An input is a mode byte, followed by a message from its service id on. A message that can be read must take
+// at most eight times its size in memory, have attributes with valid ids only, and be the same after it is
+// written and read again. It is then passed to all users of messages: readers that copy and that take over,
+// the dump, the answer to a monitoring query, the change event and the walk by pattern.
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -20,29 +20,29 @@ namespace {
 
 enum mode : uint8_t {
     RESPONSE = 1,
-    LOGGED = 2, // every line is written, and costs most of the time
+    LOGGED = 2, // formats all log lines, which takes most of the time
     OFFSET_SHIFT = 6,
 };
-constexpr size_t BYTES_FOR_A_BYTE = 8, BYTES_FOR_A_MESSAGE = 1024;
+constexpr size_t MEMORY_PER_BYTE = 8, MEMORY_PER_MESSAGE = 1024;
 
 void require(bool condition, const char *what) {
     if (condition)
         return;
-    fprintf(stderr, "the message is not as it should be: %s\n", what);
+    fprintf(stderr, "not true: %s\n", what);
     abort();
 }
 #define REQUIRE(condition) require((condition), #condition)
 
-lc_status read(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
+lc_status read_wire(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
     return bn_request_msg_deserialize(buffer, offset, out);
 }
-lc_status read(const tbuffer *buffer, uint32_t offset, bn_response_msg **out) {
+lc_status read_wire(const tbuffer *buffer, uint32_t offset, bn_response_msg **out) {
     return bn_response_msg_deserialize(buffer, offset, out);
 }
-lc_status write(bn_request_msg *msg, tbuffer **out) {
+lc_status write_wire(bn_request_msg *msg, tbuffer **out) {
     return bn_request_msg_serialize(msg, 0, out);
 }
-lc_status write(bn_response_msg *msg, tbuffer **out) {
+lc_status write_wire(bn_response_msg *msg, tbuffer **out) {
     return bn_response_msg_serialize(msg, 0, out);
 }
 uint32_t count_of(const bn_request_msg *msg) {
@@ -102,32 +102,32 @@ void check_same(const bn_binding *a, const bn_binding *b) {
     }
 }
 
-// Reads the message, and writes it and reads it again.
+// Reads the message, writes it and reads it again.
 template <typename Message, typename Owner>
 bool read_message(const tbuffer *buffer, uint32_t offset, Owner *out) {
     const size_t before = __sanitizer_get_current_allocated_bytes();
-    const lc_status status = read(buffer, offset, &out->pointer);
+    const lc_status status = read_wire(buffer, offset, &out->pointer);
     const size_t taken = __sanitizer_get_current_allocated_bytes() - before;
     if (status != LC_OK) {
         REQUIRE(!out->pointer);
         return false;
     }
-    REQUIRE(taken <= BYTES_FOR_A_BYTE * buffer->length + BYTES_FOR_A_MESSAGE);
+    REQUIRE(taken <= MEMORY_PER_BYTE * buffer->length + MEMORY_PER_MESSAGE);
     Message *msg = out->pointer;
-    bool lasting = true; // an absolute name loses a first part that is empty each time it is written
+    bool stable = true; // writing an absolute name whose first part is empty drops that part
     for (uint32_t i = 0; i < count_of(msg); i++) {
         check_binding(node_of(msg, i)->binding);
-        lasting = lasting && strncmp(node_of(msg, i)->binding->name->buffer, "//", 2) != 0;
+        stable = stable && strncmp(node_of(msg, i)->binding->name->buffer, "//", 2) != 0;
     }
-    if (!lasting)
+    if (!stable)
         return true;
 
     owned_tbuffer written, again;
     Owner copy;
-    REQUIRE(write(msg, &written.pointer) == LC_OK);
+    REQUIRE(write_wire(msg, &written.pointer) == LC_OK);
     REQUIRE(msg->length == written.pointer->length && msg->length <= buffer->length);
-    REQUIRE(read(written.pointer, 0, &copy.pointer) == LC_OK);
-    REQUIRE(write(copy.pointer, &again.pointer) == LC_OK);
+    REQUIRE(read_wire(written.pointer, 0, &copy.pointer) == LC_OK);
+    REQUIRE(write_wire(copy.pointer, &again.pointer) == LC_OK);
     REQUIRE(written.pointer->length == again.pointer->length);
     REQUIRE(memcmp(written.pointer->buffer, again.pointer->buffer, again.pointer->length) == 0);
     REQUIRE(msg->msg_type == copy.pointer->msg_type && msg->msg_id == copy.pointer->msg_id);
@@ -146,7 +146,7 @@ lc_status get_one(const char *name, const tstr_array *, void *, bn_binding_array
     CHECK_STATUS(bn_binding_array_append_takeover(out, &binding.pointer));
     return LC_OK;
 }
-// Few children, and none below the third level: each wildcard multiplies them.
+// Few children, and none below the third level, because each wildcard multiplies them.
 lc_status list_children(const char *, const tstr_array *parts, void *, tstr_array *out) {
     if (tstr_array_length_quick(parts) > 2)
         return LC_OK;
@@ -154,14 +154,14 @@ lc_status list_children(const char *, const tstr_array *parts, void *, tstr_arra
         CHECK_STATUS(tstr_array_append_str(out, child));
     return LC_OK;
 }
-lc_status note(const bn_binding_array *, uint32_t, bn_binding *, const tstring *, const tstr_array *,
-               const tstring *, const tstring *, void *) {
+lc_status ignore_binding(const bn_binding_array *, uint32_t, bn_binding *, const tstring *,
+                         const tstr_array *, const tstring *, const tstring *, void *) {
     return LC_OK;
 }
 
 void use_bindings(bn_binding_array *bindings) {
     owned_bindings before, after;
-    (void)mdc_foreach_binding_prequeried(bindings, "/a/**", nullptr, note, nullptr, nullptr);
+    (void)mdc_foreach_binding_prequeried(bindings, "/a/**", nullptr, ignore_binding, nullptr, nullptr);
     const lc_status status = mdc_event_config_change_notif_extract(bindings, &before.pointer, &after.pointer);
     REQUIRE((status == LC_OK) == (before.pointer != nullptr && after.pointer != nullptr));
 }
@@ -178,7 +178,7 @@ void use_request(const tbuffer *buffer, uint32_t offset) {
     const size_t before = __sanitizer_get_current_allocated_bytes();
     if (bn_request_get(msg.pointer, &type, nullptr, 0, &copies.pointer, nullptr, nullptr) == LC_OK)
         REQUIRE(__sanitizer_get_current_allocated_bytes() - before <=
-                BYTES_FOR_A_BYTE * buffer->length + BYTES_FOR_A_MESSAGE);
+                MEMORY_PER_BYTE * buffer->length + MEMORY_PER_MESSAGE);
     if (bn_request_get(msg.pointer, &type, nullptr, 1, &bindings.pointer, &ids.pointer, &info.pointer) !=
         LC_OK)
         return;
@@ -217,7 +217,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *input, size_t size) {
     if (size < 1 || size > 1u << 20)
         return 0;
     const uint8_t mode = *input;
-    const uint32_t offset = mode >> OFFSET_SHIFT; // any alignment
+    const uint32_t offset = mode >> OFFSET_SHIFT; // tests different alignments
     G_log_level = mode & LOGGED ? LC_LOG_DEBUG : -1;
     owned_tbuffer buffer;
     REQUIRE(tb_new_buf_const(&buffer.pointer, input + 1, static_cast<uint32_t>(size - 1)) == LC_OK);

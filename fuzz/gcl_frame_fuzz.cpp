@@ -1,6 +1,5 @@
-// The frame reader of a session, fed with whatever comes. The first byte chooses how the rest is cut into
-// reads and whether handlers nest; then the bytes go through a real socket pair's worth of session, opened or
-// not.
+// Fuzzer for the frame reader of a session. The first byte of an input decides into how large reads the rest
+// is cut, and whether the session is open before; then the bytes go through a socket.
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -14,19 +13,21 @@
 #include "runtime/logging.h"
 #include "runtime/tbuffer.h"
 
-static gcl *instance;
-static fdic *interests;
-static int listener = -1;
-static int depth;
-static gcl_session *session;
-static constexpr const char *PROVIDER = "/tmp/gcl-socks/uds-provider-fuzz";
+namespace {
 
-static lc_status ignore_changes(const fdic_event_array *, void *) {
+gcl *instance;
+fdic *interests;
+int listener = -1;
+int depth;
+gcl_session *session;
+constexpr const char *PROVIDER = "/tmp/gcl-socks/uds-provider-fuzz";
+
+lc_status ignore_changes(const fdic_event_array *, void *) {
     return LC_OK;
 }
 
-// Every third frame reads on from inside, as a handler that waits does.
-static lc_status take(gcl_session *of, gcl_body_protocol *, tbuffer **inout_frame, void *) {
+// For every third frame it reads further frames before it returns, as a handler that waits does.
+lc_status handle_frame(gcl_session *of, gcl_body_protocol *, tbuffer **inout_frame, void *) {
     static unsigned count;
     const uint8_t last = tb_buf(*inout_frame)[tb_length(*inout_frame) - 1];
     tb_free(inout_frame);
@@ -42,9 +43,9 @@ static lc_status take(gcl_session *of, gcl_body_protocol *, tbuffer **inout_fram
     return LC_OK;
 }
 
-static void start() {
+void start_instance() {
     G_daemon_log_level = -1;
-    G_log_level = -1; // no line is formatted, none is sent
+    G_log_level = -1; // formats no log lines
     mkdir(GCL_SOCKET_DIRECTORY, 0777);
     unlink(PROVIDER);
     sockaddr_un address{};
@@ -60,12 +61,12 @@ static void start() {
     gcl_body_protocol recorder{};
     recorder.protocol = 3;
     recorder.enabled = 1;
-    recorder.handlers[0] = {3, 0, take, nullptr};
+    recorder.handlers[0] = {3, 0, handle_frame, nullptr};
     if (gcl_register_body_protocol(instance, &recorder) != LC_OK)
         abort();
 }
 
-static void greet(int peer) {
+void send_greeting(int peer) {
     gcl_wire_header header{};
     memcpy(header.ident, GCL_FRAME_IDENT, sizeof header.ident);
     header.version = to_be32(GCL_FRAME_VERSION);
@@ -81,10 +82,12 @@ static void greet(int peer) {
     (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_READABLE, session, nullptr);
 }
 
+} // namespace
+
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size);
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     if (!instance)
-        start();
+        start_instance();
     if (size < 1 || size > 60000)
         return 0;
     if (gcl_session_client_new(instance, "fuzz", nullptr, 0, &session) != LC_OK ||
@@ -92,7 +95,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
         abort();
     const int peer = accept(listener, nullptr, nullptr);
     if (data[0] & 0x80)
-        greet(peer);
+        send_greeting(peer);
     const size_t step = data[0] % 4 == 0 ? size : data[0] % 128u + 1u;
     for (size_t at = 1; at < size; at += step) {
         const size_t now = size - at < step ? size - at : step;
@@ -103,10 +106,10 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_READABLE, session, nullptr);
     int32_t state = 0;
     if (gcl_session_get_state(session, &state, nullptr) != LC_OK || state != GCL_SESSION_CLOSED)
-        abort(); // whatever came, the end of file was seen
+        abort(); // the end of file must have been noticed
     (void)gcl_session_free(&session);
     static unsigned runs;
-    if (++runs % 1000 == 0) { // freed records stay until the instance goes
+    if (++runs % 1000 == 0) { // the instance keeps freed records until it is freed itself
         if (gcl_deinit(&instance) != LC_OK || fdic_deinit(&interests) != LC_OK)
             abort();
         close(listener);

@@ -1,9 +1,9 @@
-// The packet path of the user-space data plane, without the kernel: what comes in GRE is read, merged,
-// written into memory, split again and compared; and what a TUN device might return is split.
+// Fuzzer for the packet path of the user-space data plane, without the kernel. Packets in GRE are read,
+// merged, split again and compared with the originals; reads from a TUN device are split.
 //
-// An input is a mode byte and then, by its lowest bit, frames or one read of a TUN device. A frame is a
-// length of 16 bits and so many bytes of GRE; a length with the highest bit set repeats the last frame as the
-// next segments of its flow. All packets lie in memory of exactly their size.
+// An input is a mode byte, followed by frames or, if its lowest bit is set, by one read from a TUN device. A
+// frame is a 16-bit length and that many bytes of GRE. A length with the highest bit set repeats the last
+// frame as the next segments of its flow. All packets are in memory blocks of exactly their size.
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -19,17 +19,17 @@ namespace {
 
 enum mode : uint8_t {
     TUN_READ = 1,
-    MENDED = 2,     // lengths and checksums inside, as far as they can be
-    UDP_MERGED = 4, // the device takes large UDP packets
-    FLUSHED = 8,    // after each fifth frame
+    MENDED = 2,     // corrects lengths and checksums as far as possible
+    UDP_MERGED = 4, // the device accepts large UDP packets
+    FLUSHED = 8,    // flushes after each fifth frame
 };
-constexpr size_t MAX_FRAMES = 300, MAX_FRAME_BYTES = 100000; // more than one large packet holds
+constexpr size_t MAX_FRAMES = 300, MAX_FRAME_BYTES = 100000; // more than fits into one large packet
 using bytes = std::vector<uint8_t>;
 
 void require(bool condition, const char *what) {
     if (condition)
         return;
-    fprintf(stderr, "the packet path is not as it should be: %s\n", what);
+    fprintf(stderr, "not true: %s\n", what);
     abort();
 }
 #define REQUIRE(condition) require((condition), #condition)
@@ -47,7 +47,7 @@ ip4_wire_header *ip_of(uint8_t *packet) {
     return reinterpret_cast<ip4_wire_header *>(packet);
 }
 
-// The checksum field of TCP and UDP, when the packet has one.
+// The checksum field of TCP or UDP; nullptr if the packet has none.
 be16 *transport_checksum(uint8_t *packet, size_t length) {
     const size_t header = ip4_header_length(*ip_of(packet));
     if (to_host(ip_of(packet)->fragment) & IP4_FRAGMENT)
@@ -79,7 +79,7 @@ void mend_packet(uint8_t *packet, size_t length) {
         checksum_add(checksum_pseudo(*ip_of(packet), length - header), packet + header, length - header));
 }
 
-// Where the carried packet begins, if the GRE header is as most are.
+// The offset of the inner packet after a typical GRE header.
 size_t offset_of_packet(const bytes &gre) {
     if (gre.size() < 5)
         return gre.size();
@@ -99,8 +99,8 @@ void mend_frame(bytes *gre) {
     memcpy(gre->data() + 4, &sum, sizeof sum);
 }
 
-// The next segment of the same flow.
-void advance(bytes *gre) {
+// Turns the frame into the next segment of the same flow.
+void advance_segment(bytes *gre) {
     const size_t at = offset_of_packet(*gre);
     if (gre->size() - at < sizeof(ip4_wire_header) + sizeof(tcp_wire_header))
         return;
@@ -112,7 +112,7 @@ void advance(bytes *gre) {
         tcp->sequence = to_be32(static_cast<uint32_t>(to_host(tcp->sequence) + gre->size() - at - headers));
 }
 
-// Packets in order, by what keeps its order: a flow, or its addresses where there are no ports.
+// Packets in order, by flow, or by addresses if there are no ports. Only within these the order is kept.
 using flow_table = std::map<bytes, std::vector<bytes>>;
 void keep_packet(flow_table *table, bytes packet) {
     ip4_wire_header *ip = ip_of(packet.data());
@@ -122,13 +122,13 @@ void keep_packet(flow_table *table, bytes packet) {
     if (checksum && ip4_header_length(*ip) == sizeof *ip)
         key.insert(key.end(), packet.begin() + 20, packet.begin() + 24);
     if (checksum && to_host(*checksum) == 0 && ip->protocol == PROTOCOL_TCP)
-        *checksum = to_be16(0xffff); // the other way to write it
+        *checksum = to_be16(0xffff); // another representation of 0
     if (to_host(ip->fragment) & IP4_DONT_FRAGMENT)
-        ip->id = ip->checksum = {}; // equal ones are numbered anew
+        ip->id = ip->checksum = {}; // merging may change the ids
     (*table)[key].push_back(std::move(packet));
 }
 
-flow_table taken, given;
+flow_table packets_in, packets_out;
 uint64_t packets_written;
 
 void split_and_keep(const virtio_header &header, const bytes &content) {
@@ -138,11 +138,11 @@ void split_and_keep(const virtio_header &header, const bytes &content) {
     for (split_segment segment; split_next(&split, &segment);) {
         bytes one(segment.header, segment.header + segment.header_length);
         one.insert(one.end(), segment.payload, segment.payload + segment.payload_length);
-        keep_packet(&given, std::move(one));
+        keep_packet(&packets_out, std::move(one));
     }
 }
 
-void take_write(void *, const iovec *parts, size_t count, uint32_t packets) {
+void check_write(void *, const iovec *parts, size_t count, uint32_t packets) {
     REQUIRE(count >= 2 && count <= 2 + COALESCED_SEGMENTS && packets >= 1);
     REQUIRE(parts[0].iov_len == sizeof(virtio_header));
     virtio_header header;
@@ -161,7 +161,7 @@ void take_write(void *, const iovec *parts, size_t count, uint32_t packets) {
     split_and_keep(header, packet);
 }
 
-bytes in_outer_packet(const bytes &gre) {
+bytes add_outer_header(const bytes &gre) {
     bytes out(sizeof(ip4_wire_header));
     *ip_of(out.data()) = {0x45,
                           0,
@@ -178,8 +178,8 @@ bytes in_outer_packet(const bytes &gre) {
     return out;
 }
 
-// Each service passes all that it may on to a member of its own.
-const passing_lookup &passing() {
+// A table by which each service passes packets on to another member.
+const passing_lookup &make_passing_lookup() {
     static const passing_lookup *const lookup = [] {
         passing_table table;
         for (uint32_t service = 0; service < 256; service++)
@@ -192,8 +192,9 @@ const passing_lookup &passing() {
     return *lookup;
 }
 
-// True when the packet that the frame carries has gone to the coalescer, from `frame`'s own memory.
-bool take_frame(coalescer *merger, exact_memory *frame) {
+// Reads a frame and gives its inner packet, in the memory of `frame`, to the coalescer; false if it is
+// refused.
+bool read_frame(coalescer *merger, exact_memory *frame) {
     gre_outer outer;
     if (read_gre_outer(frame->memory.get(), frame->length, &outer) != REFUSALS)
         return false;
@@ -203,26 +204,26 @@ bool take_frame(coalescer *merger, exact_memory *frame) {
         return false;
     REQUIRE(ip4_is_valid(content.packet, content.length));
     uint32_t local = 0;
-    if (const uint32_t member = find_passing_member(passing(), content, &local)) {
+    if (const uint32_t member = find_passing_member(make_passing_lookup(), content, &local)) {
         const auto *tcp = reinterpret_cast<const tcp_wire_header *>(
             content.packet + ip4_header_length(*ip_of(content.packet)));
         REQUIRE(content.has_redirect && local == 1 && member == content.redirect.service + 2u);
         REQUIRE(ip_of(content.packet)->protocol == PROTOCOL_TCP &&
                 (tcp->flags & (TCP_SYN | TCP_ACK | TCP_RST | TCP_FIN)) != TCP_SYN);
     }
-    keep_packet(&taken, bytes(content.packet, content.packet + content.length));
+    keep_packet(&packets_in, bytes(content.packet, content.packet + content.length));
     coalesce_packet(merger, nullptr, content.packet, content.length);
     return true;
 }
 
-void take_frames(uint8_t mode, const uint8_t *data, size_t size) {
+void fuzz_frames(uint8_t mode, const uint8_t *data, size_t size) {
     static coalescer merger;
-    merger.sink = take_write;
+    merger.sink = check_write;
     merger.merge_udp = mode & UDP_MERGED;
-    taken.clear();
-    given.clear();
+    packets_in.clear();
+    packets_out.clear();
     packets_written = 0;
-    std::vector<exact_memory> frames; // stay until the flush
+    std::vector<exact_memory> frames; // the coalescer refers to them until the flush
     bytes gre;
     uint64_t accepted = 0;
     size_t carried = 0;
@@ -242,21 +243,21 @@ void take_frames(uint8_t mode, const uint8_t *data, size_t size) {
         for (; times > 0 && frames.size() < MAX_FRAMES && carried < MAX_FRAME_BYTES; times--) {
             carried += gre.size();
             if (head & 0x8000)
-                advance(&gre);
+                advance_segment(&gre);
             if (mode & MENDED)
                 mend_frame(&gre);
-            frames.emplace_back(in_outer_packet(gre));
-            accepted += take_frame(&merger, &frames.back());
+            frames.emplace_back(add_outer_header(gre));
+            accepted += read_frame(&merger, &frames.back());
             if ((mode & FLUSHED) && frames.size() % 5 == 0)
                 coalesce_flush(&merger);
         }
     }
     coalesce_flush(&merger);
     REQUIRE(merger.used == 0 && packets_written == accepted);
-    REQUIRE(taken == given);
+    REQUIRE(packets_in == packets_out);
 }
 
-void take_tun_read(uint8_t mode, const uint8_t *data, size_t size) {
+void fuzz_tun_read(uint8_t mode, const uint8_t *data, size_t size) {
     virtio_header header;
     if (size < sizeof header)
         return;
@@ -293,8 +294,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     if (size == 0)
         return 0;
     if (data[0] & TUN_READ)
-        take_tun_read(data[0], data + 1, size - 1);
+        fuzz_tun_read(data[0], data + 1, size - 1);
     else
-        take_frames(data[0], data + 1, size - 1);
+        fuzz_frames(data[0], data + 1, size - 1);
     return 0;
 }

@@ -1,13 +1,13 @@
-// Received packets, from the header on, into a group that two routers already report to.
+// Fuzzer for received packets, in a group that has reports of two routers.
 //
-// An input is a mode byte and then packets, each after two bytes: in their low 13 bits its length (the rest
-// of the input, when there is less), in the high 3 bits how much time passes after it. The mode's bits are in
-// `mode` below. MENDED makes length, version, group and digest of each packet right before it is processed,
-// so that what is wrong further in is reached; without it they have to be found.
+// An input is a mode byte, followed by packets. Two bytes precede each packet: the low 13 bits are its length
+// (or the rest of the input, if that is shorter), the high 3 bits select how much time passes after it. With
+// MENDED the length, version, group and digest of each packet are corrected, so that the code after these
+// checks is reached; without it the fuzzer has to find them.
 //
-// The whole engine runs, but for its threads and sockets: time passes by ticks, messages are built and go
-// nowhere, and there is no mailbox, so that a tunnel is refused at once. After each packet the records must
-// agree with each other, and when the group has gone nothing may be left of it.
+// The whole engine runs except for its threads and sockets: ticks make the time pass, messages are built and
+// not sent, and without a mailbox tunnels are refused at once. After each packet the records must be
+// consistent, and after the group is deleted nothing of it may be left.
 
 #include <algorithm>
 #include <cstdio>
@@ -28,8 +28,8 @@ enum mode : uint8_t {
     MD5 = 2,
     BY_MASK = 4,
     MENDED = 8,
-    DESIGNATED = 16, // a table is out and waits for acknowledgements
-    LOGGED = 32,     // every line is written, and costs most of the time
+    DESIGNATED = 16, // we are designated and wait for acknowledgements of a table
+    LOGGED = 32,     // formats all log lines, which takes most of the time
 };
 constexpr uint32_t ticks_after[8] = {0, 1, 2, 11, 17, 41, 61, 0};
 constexpr size_t DIGEST_AT = 16;
@@ -37,7 +37,7 @@ constexpr size_t DIGEST_AT = 16;
 void require(bool condition, const char *what) {
     if (condition)
         return;
-    fprintf(stderr, "the records don't agree: %s\n", what);
+    fprintf(stderr, "inconsistent records: %s\n", what);
     abort();
 }
 #define REQUIRE(condition) require((condition), #condition)
@@ -52,7 +52,7 @@ uint32_t list_length(Entry *const *head) {
     return length;
 }
 
-// A reference count is the number of routers that report an address, and no router reports one twice.
+// The reference count of an address is the number of routers that report it, and none reports it twice.
 template <typename UnionEntry, typename Entry, size_t Size>
 void check_references(const wccp_service_group *group, const UnionEntry *first,
                       uint32_t wccp_sending_router::*count, Entry (wccp_sending_router::*entries)[Size]) {
@@ -103,13 +103,13 @@ void check_group(const wccp_service_group *group) {
                      &wccp_sending_router::view_appliances);
 }
 
-void mend(const wccp_service_group *group, wccp_pkt *pkt) {
+void mend_packet(const wccp_service_group *group, wccp_pkt *pkt) {
     uint8_t *bytes = pkt->data;
     const uint32_t service_at = group->security_option == 1 ? 32 : 16;
     if (pkt->length < service_at + 28)
         return;
-    const uint32_t behind = pkt->length - 8;
-    const uint8_t header[] = {2, 0, static_cast<uint8_t>(behind >> 8), static_cast<uint8_t>(behind & 0xff)};
+    const uint32_t body = pkt->length - 8;
+    const uint8_t header[] = {2, 0, static_cast<uint8_t>(body >> 8), static_cast<uint8_t>(body & 0xff)};
     memcpy(bytes + 4, header, sizeof header);
     bytes[service_at + 5] = group->id;
     if (group->security_option != 1)
@@ -120,7 +120,7 @@ void mend(const wccp_service_group *group, wccp_pkt *pkt) {
     memcpy(bytes + DIGEST_AT, digest, sizeof digest);
 }
 
-void prepare(const reported_group &reported, uint8_t mode) {
+void prepare_group(const reported_group &reported, uint8_t mode) {
     wccp_service_group *group = reported.group;
     group->compat_mode = mode & NEXUS ? WCCP_COMPAT_NEXUS : WCCP_COMPAT_IOS;
     group->security_option = mode & MD5 ? 1 : 0;
@@ -149,7 +149,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *input, size_t size) {
     G_daemon_log_level = mode & LOGGED ? LC_LOG_DEBUG : LC_LOG_EMERG;
     {
         const reported_group reported(true);
-        prepare(reported, mode);
+        prepare_group(reported, mode);
         check_group(reported.group);
         for (input++; end - input > 2;) {
             const uint32_t word = static_cast<uint32_t>(input[0] << 8 | input[1]);
@@ -159,7 +159,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *input, size_t size) {
             const received_packet pkt = make_received(std::vector<uint8_t>(input, input + length), ROUTER_A);
             input += length;
             if (mode & MENDED)
-                mend(reported.group, pkt.get());
+                mend_packet(reported.group, pkt.get());
             wccp_process_received_packet(pkt.get());
             REQUIRE(pkt->offset <= pkt->length && pkt->cursor == pkt->data + pkt->offset);
             check_group(reported.group);
