@@ -1,15 +1,14 @@
 #!/bin/bash
-# mgmtd is stopped (SIGSTOP), not gone, while a router flaps for 200 groups: alarms and changes of role fill the
-# socket and then the queue, which is logged once; the steady router still hears Here-I-Am every 10 seconds and is
-# answered; SIGTERM ends the daemon in order within 3 seconds, and mgmtd goes on once it is continued.
+# mgmtd is stopped (SIGSTOP) while the router of 200 groups flaps: alarms and role changes fill the socket and then the
+# queue, which is logged once. Another router still gets Here-I-Am every 10 seconds. SIGTERM ends wccpd within 3 seconds,
+# and mgmtd continues normally after SIGCONT.
 #   scenario_alarm_stop.sh DIRECTORY_OF_THE_PROGRAMS [SECONDS]
-# With SECONDS of the wall it runs bench/wccpd_timed, half of that time with mgmtd running and half with it stopped, and
-# prints what the engine's lock was held for, instead of filling the queue.
+# With SECONDS it does not fill the queue, but runs bench/wccpd_timed, for half of that time with mgmtd running and for
+# half with it stopped, and prints how long the engine's lock was held.
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
 export WCCP_BIN=${1:-$top/build/release/bin}
-# Two hundred groups within the seconds of the protocol: more than a daemon under the sanitizers does thirty times as
-# fast on a busy machine.
+# With a sanitizer, on a busy machine, wccpd can't serve 200 groups at thirty times the speed.
 if ! grep -q __asan_init "$WCCP_BIN/wccpd"; then : "${LAB_SPEED:=30}"; else : "${LAB_SPEED:=10}"; fi
 export LAB_SPEED LAB_LOG_LEVEL=notice
 # shellcheck source=../lab/topology.sh
@@ -18,9 +17,10 @@ lab_enter "$0" "$@"
 measured=${2-}
 
 fail() { echo "$*" >&2; tail -n 15 "$LAB"/a1.log "$LAB"/a1-*.out >&2; exit 1; }
-heard() { jq -c 'select(.what == "here-i-am" and .service == 255) | .t' "$LAB/r2.log"; }
-# The router's tables go to nobody and come back: two changes of role of each group, and an alarm at times. A query is
-# answered at once and three times, and the router answers each with a message: no period of the protocol is waited for.
+list_hello_times() { jq -c 'select(.what == "here-i-am" and .service == 255) | .t' "$LAB/r2.log"; }
+# The router's tables name no appliance, and then do again: two role changes of each group, and sometimes an alarm. wccpd
+# answers a query three times at once, and the router answers each of them, so that the flap does not wait for a period of
+# the protocol.
 flap() {
     local map
     for map in nobodys-map none; do
@@ -39,7 +39,7 @@ lab_write_config a1 "${groups[@]}"
 lab_mgmtd_start a1
 lab_tunneld_start a1
 lab_start a1 wccpd "wccpd${measured:+_timed}"
-lab_wait_role 30 a1 255 ACTIVE && lab_wait_role 30 a1 250 ACTIVE || fail "the groups don't become active"
+lab_wait_role 30 a1 255 ACTIVE && lab_wait_role 30 a1 250 ACTIVE || fail "the groups did not become active"
 
 mgmtd=$(lab_pid a1 mgmtd)
 if [ -n "$measured" ]; then
@@ -71,11 +71,11 @@ else
     done
     flap
     [ "$(grep -c 'output queue full with [0-9]* bytes, peer [^ ]* does not read; frames are lost' "$LAB/a1.log")" = 1 ] ||
-        fail "a full queue is not logged once"
-    # A busy machine may hold it up for a moment; a daemon that waits for mgmtd says nothing any more.
-    heard | jq -es '[.[1:], .[:-1]] | transpose | map(.[0] - .[1]) | length > 25 and max < 60 and
+        fail "a full queue was not logged exactly once"
+    # The tolerance is for a busy machine: a wccpd that waits for mgmtd would send nothing at all.
+    list_hello_times | jq -es '[.[1:], .[:-1]] | transpose | map(.[0] - .[1]) | length > 25 and max < 60 and
         (sort | .[length / 10 | floor] > 9 and .[length * 9 / 10 | floor] < 11.5)' >/dev/null ||
-        fail "Here-I-Am does not come every 10 seconds: $(heard | tr '\n' ' ')"
+        fail "Here-I-Am does not come every 10 seconds: $(list_hello_times | tr '\n' ' ')"
     lab_wait 5 '.groups["255"] | .assignment.kind != "none" and .appliances[0].address == "10.0.0.101"' lab_ctl r2 show ||
         fail "the steady router has lost the appliance"
 fi
@@ -83,11 +83,11 @@ fi
 began=${EPOCHREALTIME/./}
 # shellcheck disable=SC2046
 kill -TERM $(lab_pid a1 wccpd)
-lab_wait_exit 3 a1 wccpd || fail "after SIGTERM the daemon ended with $?"
-[ $((${EPOCHREALTIME/./} - began)) -lt 3000000 ] || fail "the end takes too long"
-[[ $(tail -n 3 "$LAB/a1.log") = *"WCCP: wccp manager is exiting"*"WCCP daemon exiting with code 0"* ]] || fail "no end in order"
+lab_wait_exit 3 a1 wccpd || fail "after SIGTERM wccpd exited with $?"
+[ $((${EPOCHREALTIME/./} - began)) -lt 3000000 ] || fail "the shutdown took too long"
+[[ $(tail -n 3 "$LAB/a1.log") = *"WCCP: wccp manager is exiting"*"WCCP daemon exiting with code 0"* ]] || fail "no orderly shutdown"
 # shellcheck disable=SC2086
 kill -CONT $mgmtd "${LAB_PID[a1/mgmtd]}"
-lab_wait_event 10 a1 '^session of wccpd-[0-9]* closed' || fail "mgmtd does not go on"
-lab_stop a1 mgmtd || fail "mgmtd ended with $?"
+lab_wait_event 10 a1 '^session of wccpd-[0-9]* closed' || fail "mgmtd did not continue"
+lab_stop a1 mgmtd || fail "mgmtd exited with $?"
 exit 0

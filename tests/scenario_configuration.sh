@@ -1,5 +1,6 @@
 #!/bin/bash
-# What an operator changes while groups run: each node of a group, whole groups, policy groups, the mode of the system.
+# Configuration changes while groups run: each node of a group, whole groups, policy groups, the mode of the system; and
+# mgmtd with its file: killed in commits, on a full disk, and in a fleet.
 #   scenario_configuration.sh DIRECTORY_OF_THE_PROGRAMS [CASE...]
 set -u
 : "${LAB_SPEED:=8}"
@@ -9,24 +10,24 @@ source "$(dirname "$0")/../lab/cases.sh"
 lab_cases "$@"
 
 words=(assign_method=hash)
-# One more word for the group, or another value for one that it has: one commit, applied to the running group.
-change() { # WORD LINE_OF_THE_LOG
+# Adds a NAME=VALUE to the group, or changes its value, and expects wccpd to apply it to the running group.
+change() { # NAME=VALUE LINE_OF_THE_LOG
     local word kept=()
     for word in "${words[@]}"; do [ "${word%%=*}" = "${1%%=*}" ] || kept+=("$word"); done
     words=("${kept[@]}" "$1")
     lab_mark a1
     configure a1 "$(lab_group 51 10.0.0.1 10.0.0.2 "${words[@]}")" || die "$1"
-    says a1 5 "WCCP config: $2\$"
-    says a1 5 'WCCP Modify config complete'
+    wait_log a1 5 "WCCP config: $2\$"
+    wait_log a1 5 'WCCP Modify config complete'
 }
-changes() { [[ $(lab_state a1 51 | jq -r .debug) = *"$1"* ]] || die "the group's record lacks: $1"; }
+record_has() { [[ $(lab_state a1 51 | jq -r .debug) = *"$1"* ]] || die "not in the record of the group: $1"; }
 
-# None of these stops the group or takes it out of ACTIVE; each is in the next message that it belongs to.
+# No change of a node makes the group leave ACTIVE.
 case_nodes() {
     lab_router r1 10.0.0.1
     lab_router r2 10.0.0.2
-    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1 10.0.0.2 assign_method=hash)"
-    role a1 30 51 ACTIVE
+    start_appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1 10.0.0.2 assign_method=hash)"
+    wait_role a1 30 51 ACTIVE
     change weight=7 'set weight to 7'
     change hash_dst_ip=true 'set hash dst ip to yes'
     change hash_src_port=true 'set hash src port to yes'
@@ -41,107 +42,108 @@ case_nodes() {
     change assign_method=mask 'set assignment method to mask'
     change policy_grp=9 'set policy grp to 9'
     router_is r1 15 51 '$g.appliances[0].weight == 7'
-    changes 'WCCP config fwd, assign, return  : gre, mask,'
-    changes 'WCCP service flags               : 0xe'
-    changes 'Configured MASK            : src-ip: 0x00000003, src-port: 0x0010'
-    # What has been agreed stays until the group starts anew; then what was changed is agreed.
+    record_has 'WCCP config fwd, assign, return  : gre, mask,'
+    record_has 'WCCP service flags               : 0xe'
+    record_has 'Configured MASK            : src-ip: 0x00000003, src-port: 0x0010'
+    # The negotiated methods stay until the group starts again; then the changed ones are negotiated.
     group_is a1 1 51 '.oper == "ACTIVE, DESIGNATED" and .router["1"].fwd_method == "L2" and .router["1"].assign_method == "HASH"'
     change admin=down 'set admin down:2'
     router_is r1 5 51 '$g.appliances == []'
     group_is a1 5 51 '.oper == "INIT" and .num_routers == 0'
     change admin=up 'set admin up:1'
-    role a1 30 51 ACTIVE
+    wait_role a1 30 51 ACTIVE
     group_is a1 10 51 '.router["1"].fwd_method == "GRE" and .router["1"].assign_method == "MASK"'
     router_is r1 10 51 '$g.service.flags == 14 and ($g.assignment.masks[0].mask | [.src_ip, .dst_ip, .src_port, .dst_port]) == [3, 1, 16, 32]'
-    grep -q 'L2 return group 51 value 1: done' "$LAB/a1-tunneld.out" || die "tunneld was not told of the L2 return"
+    grep -q 'L2 return group 51 value 1: done' "$LAB/a1-tunneld.out" || die "tunneld did not get the L2 return"
     finish a1
 }
 
-# A password here that the routers don't have yet: they refuse, and heed the group again once they have it.
+# The group gets a password before the routers do: they refuse its messages until they have the password as well.
 case_password() {
     lab_router r1 10.0.0.1 -- --query-after 600 --drop-after 600
-    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1)"
-    role a1 30 51 ACTIVE
+    start_appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1)"
+    wait_role a1 30 51 ACTIVE
     lab_mark a1
     configure a1 "$(lab_group 51 10.0.0.1 password=squeak)"
-    says a1 5 'WCCP config: set password$'
-    lab_wait_line 10 'refused: ' "$LAB/r1.log" || die "r1 takes a signed message"
+    wait_log a1 5 'WCCP config: set password$'
+    lab_wait_line 10 'refused: ' "$LAB/r1.log" || die "r1 accepts a signed message"
     lab_ctl r1 password squeak >/dev/null
-    lab_wait_line 10 '"what":"i-see-you".*"service":51' <(tail -n +$(($(wc -l <"$LAB/r1.log") + 1)) -f "$LAB/r1.log" & sleep 4; kill $!) ||
-        die "r1 does not answer"
+    local answers; answers=$(grep -c '"what":"i-see-you".*"service":51' "$LAB/r1.log")
+    lab_wait 10 ". > $answers" grep -c '"what":"i-see-you".*"service":51' "$LAB/r1.log" || die "r1 does not answer"
     group_is a1 10 51 '.router["1"].state == "TWO-WAY connected"'
     ! grep -q squeak "$LAB/a1.log" || die "the password is in the log"
     finish a1 -- 'mismatch security opt'
 }
 
-# What a running group doesn't follow, and a node without a default that is taken out: it is deleted and created again,
-# within one commit that changes another group in place and creates a third.
-case_as_a_whole() {
+# One commit recreates a group (its priority can't change while it runs, and a node without a default is deleted), changes
+# another group in place and creates a third.
+case_recreated() {
     lab_router r1 10.0.0.1
     lab_router r2 10.0.0.2
-    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1 10.0.0.2 policy_grp=5)" "$(lab_group 52 10.0.0.1)"
-    role a1 30 51 ACTIVE
+    start_appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1 10.0.0.2 policy_grp=5)" "$(lab_group 52 10.0.0.1)"
+    wait_role a1 30 51 ACTIVE
     lab_mark a1
     configure a1 "$(lab_group 51 10.0.0.1 priority=9 protocol=udp weight=9)" "$(lab_group 52 10.0.0.1 weight=8)" "$(lab_group 53 10.0.0.1)"
-    says a1 5 'WCCP update: Deleted Group 51'
-    says a1 5 'Created WCCP group 51'
-    says a1 5 'Created WCCP group 53'
+    wait_log a1 5 'WCCP update: Deleted Group 51'
+    wait_log a1 5 'Created WCCP group 51'
+    wait_log a1 5 'Created WCCP group 53'
     router_is r1 30 51 '$g.service.priority == 9 and $g.service.protocol == 17 and $g.appliances[0].weight == 9'
     router_is r1 15 52 '$g.appliances[0].weight == 8'
     router_is r1 15 53 '($g.appliances | length) == 1'
     router_is r2 1 51 '$g.appliances == []'
-    ! lab_log a1 | grep -q 'Deleted Group 52' || die "a group that follows is deleted"
-    role a1 30 51 ACTIVE
+    ! lab_log a1 | grep -q 'Deleted Group 52' || die "group 52 was not changed in place"
+    wait_role a1 30 51 ACTIVE
     finish a1
 }
 
-# Forty groups come and go with one commit each.
+# One commit creates forty groups, another deletes them.
 case_many() {
     local id text=''
     lab_router r1 10.0.0.1
     for id in $(seq 10 49); do text+="$(lab_group "$id" 10.0.0.1 weight=$id)"$'\n'; done
-    appliance a1 10.0.0.101
+    start_appliance a1 10.0.0.101
     configure a1 "$text"
-    lab_wait 40 '[.groups[].assignment.kind] | length == 40 and all(. == "mask")' lab_ctl r1 show || die "not all have tables"
-    lab_wait 15 '[.[].oper] | length == 40 and all(. == "ACTIVE, DESIGNATED")' lab_state a1 || die "not all are active"
+    lab_wait 40 '[.groups[].assignment.kind] | length == 40 and all(. == "mask")' lab_ctl r1 show || die "not all groups have tables"
+    lab_wait 15 '[.[].oper] | length == 40 and all(. == "ACTIVE, DESIGNATED")' lab_state a1 || die "not all groups are active"
     configure a1
-    lab_wait 10 '[.groups[].appliances[]] == []' lab_ctl r1 show || die "not all have left"
+    lab_wait 10 '[.groups[].appliances[]] == []' lab_ctl r1 show || die "not all groups have left"
     lab_wait 5 '. == {}' lab_state a1 || die "groups are left"
     finish a1
 }
 
-# A policy group is as its groups are: active with all of them. One that has groups can't be deleted before they leave it.
+# A policy group is ACTIVE when all of its groups are, and can't be deleted while it has groups.
 case_policy() {
-    roles() { lab_wait_line "$1" "$2" "$LAB/a1-tunneld.out" || die "role"; }
+    wait_policy_role() { lab_wait_line "$1" "$2" "$LAB/a1-tunneld.out" || die "role of the policy group"; }
     local policy='[/qv/wccpd/wccp/policy_grp/config/5]'
     lab_router r1 10.0.0.1
     lab_router r2 10.0.0.2
     lab_ctl r2 stop >/dev/null
     LAB_TUNNELD=--roles
-    appliance a1 10.0.0.101 "$policy" name=blue "$(lab_group 51 10.0.0.1 policy_grp=5)" "$(lab_group 52 10.0.0.2 policy_grp=5)"
-    role a1 30 51 ACTIVE
-    roles 5 '5.*BACKUP'
+    start_appliance a1 10.0.0.101 "$policy" name=blue "$(lab_group 51 10.0.0.1 policy_grp=5)" "$(lab_group 52 10.0.0.2 policy_grp=5)"
+    wait_role a1 30 51 ACTIVE
+    wait_policy_role 5 '5.*BACKUP'
     lab_ctl r2 resume >/dev/null
-    role a1 40 52 ACTIVE
-    roles 5 '5.*ACTIVE'
+    wait_role a1 40 52 ACTIVE
+    wait_policy_role 5 '5.*ACTIVE'
     ! lab_configure a1 "$(lab_group 51 10.0.0.1 policy_grp=5)" "$(lab_group 52 10.0.0.2 policy_grp=6)" 2>/dev/null ||
-        die "a policy group in use is deleted"
+        die "a policy group in use was deleted"
     configure a1 "$(lab_group 51 10.0.0.1 policy_grp=6)" "$(lab_group 52 10.0.0.2 policy_grp=6)"
-    says a1 5 'WCCP update: Deleted policy Group 5'
-    roles 5 '6.*ACTIVE'
-    roles 5 '5.*UNKNOWN'
+    wait_log a1 5 'WCCP update: Deleted policy Group 5'
+    wait_policy_role 5 '6.*ACTIVE'
+    wait_policy_role 5 '5.*UNKNOWN'
     lab_ctl r2 stop >/dev/null
-    role a1 40 52 BACKUP
-    roles 5 '6.*BACKUP'
+    wait_role a1 40 52 BACKUP
+    wait_policy_role 5 '6.*BACKUP'
     finish a1
 }
 
-# A bridge redirects nothing: its groups take leave, and stand until the daemon starts in another mode.
+# In bridge mode nothing is redirected: the groups send a shutdown message, and stay down until wccpd starts in another
+# mode.
 case_bridge() {
     local mode='[/qv/tunneld/system/config]' sent
     lab_router r1 10.0.0.1
-    appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1)"
-    role a1 30 51 ACTIVE
+    start_appliance a1 10.0.0.101 "$(lab_group 51 10.0.0.1)"
+    wait_role a1 30 51 ACTIVE
     configure a1 "$mode" mode=bridge "$(lab_group 51 10.0.0.1)"
     router_is r1 5 51 '.counters.rx_shutdown == 1 and $g.appliances == []'
     group_is a1 5 51 '.oper == "INIT"'
@@ -149,31 +151,31 @@ case_bridge() {
     configure a1 "$mode" mode=router "$(lab_group 51 10.0.0.1)"
     lab_sleep 25
     router_is r1 1 51 ".counters.rx_here_i_am == $sent"
-    lab_stop a1 wccpd || die "ended with $?"
+    lab_stop a1 wccpd || die "wccpd exited with $?"
     lab_wccpd_start a1
-    role a1 30 51 ACTIVE
-    lab_stop a1 wccpd || die "ended with $?"
-    # Started as a bridge: no timers, nothing said, queries answered, the end as ever.
+    wait_role a1 30 51 ACTIVE
+    lab_stop a1 wccpd || die "wccpd exited with $?"
+    # Started in bridge mode, wccpd sends nothing, but answers mgmtctl.
     configure a1 "$mode" mode=bridge "$(lab_group 51 10.0.0.1)"
     sent=$(lab_ctl r1 show | jq .counters.rx_here_i_am)
     lab_wccpd_start a1
-    says a1 5 'WCCP timer/rx threads are not launched in non Router mode'
+    wait_log a1 5 'WCCP timer/rx threads are not launched in non Router mode'
     lab_sleep 15
     router_is r1 1 51 ".counters.rx_here_i_am == $sent"
     group_is a1 5 51 '.oper == "INIT"'
     finish a1
 }
 
-# What is committed while the daemon starts, 300 commits over 30 starts with 256 groups: none is lost, and none undone.
-# Under a sanitizer, where a commit takes long, there are 3 starts.
+# Commits during the start of wccpd: 30 starts with 256 groups and 10 commits each, none of which is lost. With a
+# sanitizer, where commits take long, 3 starts.
 case_start() {
-    local id text='' round rounds=30 absent=0 commits runs stands nodes=/qv/wccpd/wccp/srv_grp/config
+    local id text='' round rounds=30 absent=0 commits running configured nodes=/qv/wccpd/wccp/srv_grp/config
     for id in $(seq 0 255); do text+="$(lab_group "$id" 10.0.0.1 "weight=$id")"$'\n'; done
-    LAB_LOG_LEVEL=notice appliance a1 10.0.0.101 "$text"
+    LAB_LOG_LEVEL=notice start_appliance a1 10.0.0.101 "$text"
     ! grep -q __asan_init "$WCCP_BIN/wccpd" || rounds=3
     for round in $(seq $rounds); do
-        lab_stop a1 wccpd || die "ended with $?"
-        # A group goes, the one that went before comes back, and eight others change.
+        lab_stop a1 wccpd || die "wccpd exited with $?"
+        # One group is deleted, the one deleted before is created again, and eight others change.
         lab_in a1 bash -c "set -e
             ctl() { '$WCCP_BIN/mgmtctl' --timeout 60 \"\$@\"; sleep 0.0\$((RANDOM % 4)); }
             ctl delete $nodes/$round
@@ -183,18 +185,18 @@ case_start() {
         lab_wccpd_start a1
         wait $commits || die "commits: $(cat "$LAB/commits.out")"
         absent=$round
-        runs=$(lab_manage a1 walk --children ${nodes/config/state} | jq -r '.[].name + "/debug"')
-        stands=$(lab_manage a1 walk --children $nodes | jq -r '.[].name + "/weight"')
+        running=$(lab_manage a1 walk --children ${nodes/config/state} | jq -r '.[].name + "/debug"')
+        configured=$(lab_manage a1 walk --children $nodes | jq -r '.[].name + "/weight"')
         # shellcheck disable=SC2086
-        diff <(lab_manage a1 get $runs | jq -r '.[] | "\(.name | split("/")[6]) \(.value | capture("WCCP weight *: (?<w>[0-9]+)").w)"' | sort) \
-            <(lab_manage a1 get $stands | jq -r '.[] | "\(.name | split("/")[6]) \(.value)"' | sort) >&2 ||
-            die "start $round: what runs differs from what is configured"
+        diff <(lab_manage a1 get $running | jq -r '.[] | "\(.name | split("/")[6]) \(.value | capture("WCCP weight *: (?<w>[0-9]+)").w)"' | sort) \
+            <(lab_manage a1 get $configured | jq -r '.[] | "\(.name | split("/")[6]) \(.value)"' | sort) >&2 ||
+            die "start $round: the running groups differ from the configuration"
     done
     finish a1
 }
 
-# mgmtd is killed while three clients commit: what was acknowledged is there again, in the file and in the history, and
-# nothing is left half written. WCCP_KILLS is how often.
+# mgmtd is killed while three clients commit (WCCP_KILLS times): the file and the history have every commit that was
+# acknowledged, and no half-written files are left.
 case_killed() {
     lab_appliance a1 10.0.0.101
     # shellcheck disable=SC2016
@@ -229,10 +231,10 @@ case_killed() {
         done 2>/dev/null
         ! grep "can.t be" $dir/out || fail "an entry is broken"
         echo "$kill kills, $cut of them in a commit, $(ctl history --json | jq ".[0].commit") commits"
-        kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" "${WCCP_KILLS:-60}" || die "a kill is not survived"
+        kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" "${WCCP_KILLS:-60}" || die "mgmtd did not survive a kill"
 }
 
-# A disk that is full, or that the history can't be written to, refuses the commit; what was there stays.
+# On a full disk a commit is refused, and the configuration and its history stay as they were.
 case_full() {
     lab_appliance a1 10.0.0.101
     # shellcheck disable=SC2016
@@ -252,10 +254,10 @@ case_full() {
         [ "$(ctl export)" = "$before" ] && [ "$(ctl history --json | jq ".[0].commit")" = "$last" ] || fail "something is lost"
         mount -o remount,size=1m $dir && ctl set $node/$n/assign_detail=x >/dev/null || fail "no commit after there is room again"
         ctl rollback "$last" >/dev/null && [ "$(ctl export)" = "$before" ] || fail "no rollback"
-        kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" || die "a full disk is not survived"
+        kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" || die "mgmtd did not survive a full disk"
 }
 
-# One change over three sites: it halts at the second, which refuses it, and at the first when that is not well.
+# One change for three sites: fleet-apply stops at the second, which refuses it, and at a site that is unhealthy after it.
 case_fleet() {
     local site file=$LAB/change.conf
     for site in 1 2 3; do

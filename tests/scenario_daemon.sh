@@ -1,8 +1,7 @@
 #!/bin/bash
-# The whole appliance: mgmtd, tunneld and wccpd, and one router. A group comes up from the configuration, a change of
-# its weight reaches the router, SIGTERM and the loss of mgmtd end the daemon in order; then mgmtd is killed at random
-# moments of the start.
-#   scenario_daemon.sh DIRECTORY_OF_THE_PROGRAMS        WCCP_STRESS=1: a hundred times instead of five
+# wccpd with mgmtd, tunneld and one router: pid file, sessions, locked memory, missing privileges, and the order of
+# shutdown after SIGTERM and after the loss of mgmtd. Then mgmtd is killed at random moments of the start of wccpd.
+#   scenario_daemon.sh DIRECTORY_OF_THE_PROGRAMS        WCCP_STRESS=1: a hundred kills instead of five
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
 export WCCP_BIN=${1:-$top/build/release/bin}
@@ -13,12 +12,12 @@ lab_enter "$0" "$@"
 
 rounds=5; [ -z "${WCCP_STRESS-}" ] || rounds=100
 fail() { echo "$*" >&2; lab_show a1; exit 1; }
-# The lines stand in the log in this order, from the last start of the daemon on.
-in_order() { # LINE...
+# Expects these lines, in this order, in the log since the last start of wccpd.
+log_has() { # LINE...
     local text line
     text=$(tac "$LAB/a1.log" | sed '/WCCP daemon launched/q' | tac)
     for line; do
-        [[ $text = *"$line"* ]] || fail "not in the log, or not in its place: $line"
+        [[ $text = *"$line"* ]] || fail "missing in the log, or in the wrong place: $line"
         text=${text#*"$line"}
     done
 }
@@ -31,52 +30,51 @@ lab_appliance a1 10.0.0.101
 lab_appliance_start a1 "$(lab_group 51 10.0.0.1 weight=100)"
 pid_file=/proc/${LAB_INIT[a1]}/root/run/wccpd.pid
 for _ in $(seq 40); do [ -s "$pid_file" ] && break; sleep 0.05; done
-[ "$(cat "$pid_file")" = "$(lab_in a1 pgrep -x wccpd)" ] || fail "the pid file names somebody else"
-[ "$(stat -c %a "$pid_file")" = 644 ] || fail "the mode of the pid file"
-[ "$(lab_events a1 | grep -c '^session of wccpd-[0-9]* open')" = 2 ] || fail "two sessions are awaited"
-lab_wait_role 45 a1 51 ACTIVE || fail "the group does not become active"
+[ "$(cat "$pid_file")" = "$(lab_in a1 pgrep -x wccpd)" ] || fail "wrong process id in the pid file"
+[ "$(stat -c %a "$pid_file")" = 644 ] || fail "wrong mode of the pid file"
+[ "$(lab_events a1 | grep -c '^session of wccpd-[0-9]* open')" = 2 ] || fail "not two sessions"
+lab_wait_role 45 a1 51 ACTIVE || fail "the group did not become active"
 lab_wait 5 '.groups["51"].assignment.kind as $kind | $kind == "hash" or $kind == "mask"' lab_ctl r1 show ||
     fail "the router has no table"
-# Every mapped page is locked, read or not: arenas of threads and stacks of the usual size would show here.
+# Every mapped page is locked, used or not: malloc arenas of threads, or stacks of the default size, would exceed this.
 locked=$(awk '$1 == "VmLck:" { print $2 }' "/proc/$(lab_pid a1 wccpd | tr -d ' ')/status")
 [ "$locked" -le 7168 ] || grep -q __asan_init "$WCCP_BIN/wccpd" || fail "$locked kB are locked"
 
-lab_configure a1 "$(lab_group 51 10.0.0.1 weight=7)" || fail "the weight is refused"
-lab_wait 15 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight does not arrive"
-in_order "Received event: /mgmtd/notify/dbchange" "WCCP config: set weight to 7" "WCCP Modify config complete"
+lab_configure a1 "$(lab_group 51 10.0.0.1 weight=7)" || fail "mgmtd refused the weight"
+lab_wait 15 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight did not reach the router"
+log_has "Received event: /mgmtd/notify/dbchange" "WCCP config: set weight to 7" "WCCP Modify config complete"
 
-# Without a privilege that it needs it says so, and ends.
-lacking() { # PROGRAM EXPRESSION COMMAND... : which runs the program
-    local said
-    said=$(lab_in a1 timeout 10 "${@:3}" "$WCCP_BIN/$1" 2>&1 >/dev/null)
-    [ $? = 1 ] && grep -Eq "^$1: .*$2" <<<"$said" || fail "$1 without privileges: $said"
+# A program that lacks a privilege reports it and exits.
+expect_lacking() { # PROGRAM EXPRESSION COMMAND... : COMMAND runs the program
+    local output
+    output=$(lab_in a1 timeout 10 "${@:3}" "$WCCP_BIN/$1" 2>&1 >/dev/null)
+    [ $? = 1 ] && grep -Eq "^$1: .*$2" <<<"$output" || fail "$1 without privileges: $output"
 }
-lacking wccpd 'missing privilege: CAP_IPC_LOCK, .* \(now 64 KiB\)' prlimit --memlock=65536 setpriv --bounding-set -all --inh-caps -all
-lacking wccpd 'missing privilege: to be root or user 0' setpriv --reuid 65534 --clear-groups --ambient-caps +ipc_lock --inh-caps +ipc_lock
-lacking tunneld 'missing privileges: CAP_NET_ADMIN, CAP_NET_RAW' \
+expect_lacking wccpd 'missing privilege: CAP_IPC_LOCK, .* \(now 64 KiB\)' prlimit --memlock=65536 setpriv --bounding-set -all --inh-caps -all
+expect_lacking wccpd 'missing privilege: to be root or user 0' setpriv --reuid 65534 --clear-groups --ambient-caps +ipc_lock --inh-caps +ipc_lock
+expect_lacking tunneld 'missing privileges: CAP_NET_ADMIN, CAP_NET_RAW' \
     unshare --mount sh -c 'mount -t tmpfs tmpfs /run && exec "$@"' - setpriv --bounding-set -all --inh-caps -all
 for program in wccpd tunneld mgmtd mgmtctl; do
     [[ $("$WCCP_BIN/$program" --version) =~ ^$program\ [0-9]+\.[0-9]+\.[0-9]+$ ]] || fail "$program --version"
     "$WCCP_BIN/$program" --help | grep -q -e --version || fail "$program --help"
 done
 
-lab_stop a1 wccpd || fail "after SIGTERM the daemon ended with $?"
-in_order "Received SIGTERM" "${last_steps[@]}"
-lab_wait_event 2 a1 '^forgotten with its session: /qv/alarms/state/role/51' || fail "the role is not forgotten"
-[ "$(lab_events a1 | grep -c '^session of wccpd-[0-9]* closed')" = 2 ] || fail "the sessions are not closed"
+lab_stop a1 wccpd || fail "after SIGTERM wccpd exited with $?"
+log_has "Received SIGTERM" "${last_steps[@]}"
+lab_wait_event 2 a1 '^forgotten with its session: /qv/alarms/state/role/51' || fail "mgmtd kept the role"
+[ "$(lab_events a1 | grep -c '^session of wccpd-[0-9]* closed')" = 2 ] || fail "the sessions were not closed"
 
 lab_wccpd_start a1
-lab_wait_role 10 a1 51 BACKUP || fail "the daemon does not start again"
+lab_wait_role 10 a1 51 BACKUP || fail "wccpd did not start again"
 lab_sleep 1
 lab_stop a1 mgmtd KILL 2>/dev/null
-lab_wait_exit 10 a1 wccpd || fail "without mgmtd the daemon ended with $?"
-# The alarm session may be the first to notice, and then its thread ends by itself, at any place among the others.
-in_order "Lost connection to mgmtd; exiting" "qv_alm_thread: out of main loop, exiting..."
-in_order "Lost connection to mgmtd; exiting" "${last_steps[0]}" "${last_steps[1]}" "${last_steps[3]}" "${last_steps[@]:4}"
-# What a killed mgmtd has lost is reported, and nothing else.
+lab_wait_exit 10 a1 wccpd || fail "without mgmtd wccpd exited with $?"
+# If the alarm session notices the loss first, its thread ends by itself, at any place in this order.
+log_has "Lost connection to mgmtd; exiting" "qv_alm_thread: out of main loop, exiting..."
+log_has "Lost connection to mgmtd; exiting" "${last_steps[0]}" "${last_steps[1]}" "${last_steps[3]}" "${last_steps[@]:4}"
 lab_clean_log a1 'Lost connection to mgmtd'
 
-# A daemon that has not reached mgmtd waits for a signal; one that has a session ends with it.
+# wccpd exits with the loss of its session; without a session it keeps trying, until SIGTERM.
 for ((round = 1; round <= rounds; round++)); do
     lab_mgmtd_start a1
     lab_start a1 wccpd wccpd
@@ -87,8 +85,8 @@ for ((round = 1; round <= rounds; round++)); do
     if [ $status = 124 ] && ! lab_events a1 | grep -q '^session of wccpd'; then
         lab_stop a1 wccpd; status=$?
     fi
-    [ $status = 0 ] || fail "round $round, mgmtd killed after $moment ms: the daemon ended with $status"
+    [ $status = 0 ] || fail "round $round, mgmtd killed after $moment ms: wccpd exited with $status"
 done
-# The next mgmtd takes over what the killed one left, and leaves nothing itself.
+# The next mgmtd takes over the socket of the killed one, and removes it.
 lab_mgmtd_start a1
-lab_end a1 || fail "the end"
+lab_end a1 || fail "end of a1"

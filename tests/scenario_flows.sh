@@ -1,11 +1,11 @@
 #!/bin/bash
-# Long connections through two appliances, a request per second on each. Appliances join, change their weights, are
-# killed and replaced in part, and leave: no connection breaks but those of a proxy that is killed itself.
+# Long connections through two appliances, with a request per second on each. An appliance joins, weights change, programs
+# are killed, an appliance leaves: no connection breaks, except those of a proxy that is killed itself.
 #   scenario_flows.sh DIRECTORY_OF_THE_PROGRAMS [CASE...]
-#   scenario_flows.sh DIRECTORY_OF_THE_PROGRAMS --one CASE     prints a table of what broke at which event
-#   LAB_FLOWS     how many connections (default 200)
-#   LAB_PROTECTION   protection time in seconds; 0: none. The case then only prints what broke
-#   LAB_EVENTS    which events, in this order (default: those of the case)
+#   scenario_flows.sh DIRECTORY_OF_THE_PROGRAMS --one CASE     prints a table of the connections that broke at each event
+#   LAB_FLOWS     number of connections (default 200)
+#   LAB_PROTECTION   protection time in seconds; 0: no protection. If it is set, broken connections don't fail the case
+#   LAB_EVENTS    the events, in this order (default: those of the case)
 set -u
 : "${LAB_SPEED:=4}" "${LAB_FLOWS:=200}"
 export LAB_SPEED LAB_FLOWS
@@ -13,12 +13,12 @@ export LAB_SPEED LAB_FLOWS
 source "$(dirname "${BASH_SOURCE[0]}")/../lab/cases.sh"
 lab_cases "$@"
 
-flows=$LAB/flows.out # events of the client, and `"what":"begins"` of ours
+flows=$LAB/flows.out # events of the client
 group='' section='' intercept='' last_answers=8
 
-# ---- the network: a1 and a2 share the group, a3 is there without its programs
+# --- The network: a1 and a2 share the group; the programs of a3 are not running yet
 
-begin() { # METHOD [NAME=VALUE]... : of the group
+start_flows() { # METHOD [NAME=VALUE]... : of the group
     local node n
     lab_router r1 10.0.0.1 -- --redirect c1=51 --forward "$1" --return "$1"
     lab_client c1 r1
@@ -33,81 +33,81 @@ begin() { # METHOD [NAME=VALUE]... : of the group
     done
     run_appliance a1
     run_appliance a2
-    ready 51 a1 a2
+    wait_ready 51 a1 a2
     nsenter -t "${LAB_INIT[c1]}" --net "$WCCP_BIN/wccp_router" fetch --from 10.1.0.128 --sources 112 10.2.0.2 \
         --long "$LAB_FLOWS" --life $last_answers --timeout 10 >"$flows" &
     LAB_PID[c1/client]=$! client=$!
-    lab_wait 20 ". == $LAB_FLOWS" eval 'grep -c opened "$flows"' || die "connections"
-    jq -es 'map(.proxy) | unique == ["a1", "a2"]' "$flows" >/dev/null || die "not through the two proxies"
+    lab_wait 20 ". == $LAB_FLOWS" eval 'grep -c opened "$flows"' || die "not all connections were opened"
+    jq -es 'map(.proxy) | unique == ["a1", "a2"]' "$flows" >/dev/null || die "connections do not use both proxies"
 }
-configuration() { # NODE [NAME=VALUE]...
+print_configuration() { # NODE [NAME=VALUE]...
     # shellcheck disable=SC2086
     printf '%s\n' "$(lab_group 51 10.0.0.1 $group "${@:2}")" "$intercept" "$section"
 }
 run_appliance() { # NODE
-    lab_write_config "$1" "$(configuration "$1" weight=100)"
+    lab_write_config "$1" "$(print_configuration "$1" weight=100)"
     lab_supervise "$1"
 }
 
-# ---- events; each leaves behind what the next one finds
+# --- Events; each starts from the state that the one before has left
 
-# How much of the table an appliance has, as a JQ expression over the group: of 1.
+# Prints a JQ for router_is: the fraction of the table that an appliance has.
 share_of() { # ADDRESS
     echo "([\$g.assignment.buckets[]?, \$g.assignment.masks[]?.values[].owner] | (map(select(. == \"$1\")) | length) / length)"
 }
 event_join() {
     run_appliance a3
-    ready 51 a1 a2 a3
+    wait_ready 51 a1 a2 a3
 }
 event_weight() {
-    configure a2 "$(configuration a2 weight=400)"
+    configure a2 "$(print_configuration a2 weight=400)"
     router_is r1 30 51 "$(share_of 10.0.0.102) > 0.6"
 }
 event_tunneld_killed() {
-    kill_one a1 tunneld
-    state_is a1 20 intercept '.["51"].active'
+    kill_supervised a1 tunneld
+    tunneld_is a1 20 intercept '.["51"].active'
 }
-# The designated appliance: its successor makes the table anew.
+# wccpd of the designated appliance is killed: the wccpd that replaces it should compute the same table.
 event_wccpd_killed() {
     local before
     before=$(lab_ctl r1 show | jq -c '.groups["51"].assignment | [.buckets, .masks]')
-    kill_one a1 wccpd
-    lab_wait_event 60 a1 '^role of group 51: ACTIVE' || die "a1 does not come back"
-    ready 51 a1 a2 a3
+    kill_supervised a1 wccpd
+    lab_wait_event 60 a1 '^role of group 51: ACTIVE' || die "wccpd of a1 is not active again"
+    wait_ready 51 a1 a2 a3
     [ "$(lab_ctl r1 show | jq -c '.groups["51"].assignment | [.buckets, .masks]')" = "$before" ] ||
-        echo "note: the table is not the same after wccpd of a1 was killed"
+        echo "note: the table changed after wccpd of a1 was killed"
 }
-kill_one() { # NODE NAME : its supervisor starts it again
+kill_supervised() { # NODE NAME : and waits until it is started again
     LAB_KILLED[$1]+="|uds-client-$2-[0-9]+\$"
     : >"$LAB/$1-mgmtd.out"
-    lab_in "$1" pkill -KILL -x "$2" || die "no $2 to kill"
-    lab_wait_event 20 "$1" "^process $2: started" || die "$2 of $1"
+    lab_in "$1" pkill -KILL -x "$2" || die "cannot kill $2"
+    lab_wait_event 20 "$1" "^process $2: started" || die "$2 of $1 was not started again"
 }
 event_proxy_killed() {
     lab_stop a2 proxy KILL 2>/dev/null
-    state_is a2 10 intercept '.["51"].proxy == "down"'
+    tunneld_is a2 10 intercept '.["51"].proxy == "down"'
     lab_proxy a2
-    state_is a2 10 intercept '.["51"].proxy == "up"'
+    tunneld_is a2 10 intercept '.["51"].proxy == "up"'
 }
 event_drain_stop() {
-    kill -USR1 $client # connections end one after the other, and the new ones do not last
-    # Broken connections stay open at the proxy, which nobody tells: without protection the drain waits in vain.
+    kill -USR1 $client # connections end one after the other, and new ones are short
+    # Without protection the drain runs into its timeout: the proxy keeps connections open that broke unnoticed.
     local for=120
     [ "${LAB_PROTECTION-}" != 0 ] || for=30
-    lab_in a3 "$WCCP_BIN/mgmtctl" drain 51 for $for wait || [ $for = 30 ] || die "the drain ended with $?"
-    lab_stop a3 mgmtd || die "mgmtd of a3 ended with $?"
+    lab_in a3 "$WCCP_BIN/mgmtctl" drain 51 for $for wait || [ $for = 30 ] || die "drain exited with $?"
+    lab_stop a3 mgmtd || die "mgmtd of a3 exited with $?"
     router_is r1 30 51 '$g.appliances | length == 2'
 }
 
-# ---- what came of it
+# --- Results
 
-# What breaks by what was asked from now on is this event's.
-note_begin() { # EVENT
+# A connection that breaks by a request from now on is counted for this event.
+record_event() { # EVENT
     jq -nc --arg event "$1" --arg now "$EPOCHREALTIME" \
         '{asked: ($now | tonumber), what: "begins", event: $event}' >>"$LAB/events"
 }
-# One JSON object for each event: connections that were open when it began, by proxies, and those that broke.
-summary() {
+# Prints a JSON object for each event: the connections that were open when it began and those that broke, by proxy.
+print_summary() {
     jq -cs --slurpfile events "$LAB/events" '
         map(select(.what != "result")) as $all | $events | to_entries[] |
         .value.asked as $from | ($events[.key + 1].asked // 1e12) as $to |
@@ -119,7 +119,7 @@ summary() {
              why: (map(select(.what == "broken").why) | group_by(.) | map({key: .[0], value: length}) | from_entries),
              unopened: (map(select(.what == "unopened")) | length)})' "$flows"
 }
-table() { # FILE
+print_table() { # FILE
     printf '%-16s %6s %8s  %s\n' event open broken of
     jq -r '[.event, (.open | add // 0), (.broken | add // 0), ([.broken, .why, {unopened: .unopened}] | map(tojson) | join(" "))] | @tsv' "$1" |
         while IFS=$'\t' read -r event open broken of; do printf '%-16s %6d %8d  %s\n' "$event" "$open" "$broken" "$of"; done
@@ -130,46 +130,46 @@ run_events() { # EVENT...
     # shellcheck disable=SC2086
     [ -z "${LAB_EVENTS-}" ] || set -- $LAB_EVENTS
     for event; do
-        note_begin "$event"
+        record_event "$event"
         "event_$event"
         sleep 3
-        lab_alive c1 client || die "the client has ended"
+        lab_alive c1 client || die "the client has exited"
     done
     kill -TERM $client
     wait $client
-    summary >"$LAB/summary"
-    table "$LAB/summary"
+    print_summary >"$LAB/summary"
+    print_table "$LAB/summary"
 }
-# Nothing but what the killed proxy had.
-nothing_breaks() {
+# No connection broke, except all those of the killed proxy.
+check_broken() {
     [ -n "${LAB_PROTECTION-}" ] || jq -es 'all(.[]; .unopened == 0 and
         .broken == (if .event == "proxy_killed" then .open | {a2} else {} end))' "$LAB/summary" >/dev/null || die "connections broke"
 }
 
-# ---- cases
+# --- Cases
 
 all_events='join weight tunneld_killed wccpd_killed proxy_killed drain_stop'
 case_gre_hash() {
     LAB_PLANE=user
-    begin gre hash_src_port=true
+    start_flows gre hash_src_port=true
     # shellcheck disable=SC2086
     run_events $all_events
-    nothing_breaks
+    check_broken
 }
 case_l2_mask() {
     LAB_PLANE=''
-    begin l2 assign_method=mask mask_src_ip=0x1f mask_dst_ip=0 mask_src_port=0x1
+    start_flows l2 assign_method=mask mask_src_ip=0x1f mask_dst_ip=0 mask_src_port=0x1
     # shellcheck disable=SC2086
     run_events $all_events
-    nothing_breaks
+    check_broken
 }
-# That it is the protection which keeps them.
+# Connections do break without protection.
 case_unprotected() {
     LAB_PROTECTION=0
     LAB_PLANE=user
-    begin gre hash_src_port=true
+    start_flows gre hash_src_port=true
     run_events join
-    jq -es '.[0].broken | add > 20' "$LAB/summary" >/dev/null || die "hardly anything breaks"
+    jq -es '.[0].broken | add > 20' "$LAB/summary" >/dev/null || die "too few connections broke"
 }
 
 lab_case

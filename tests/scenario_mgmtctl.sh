@@ -1,6 +1,6 @@
 #!/bin/bash
-# mgmtctl beside the real programs: what it answers with mgmtd absent, stopped and killed, what a person and a script
-# get from each word, the monitoring tree of a group that runs, node by node, and a watch of all that happens meanwhile.
+# mgmtctl with the real programs: every command, its output for people and scripts and its exit status; the monitoring tree
+# of a running group, node by node; mgmtd absent, stopped and killed; and a watch of everything that happens meanwhile.
 #   scenario_mgmtctl.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
@@ -12,26 +12,24 @@ lab_enter "$0" "$@"
 G=/qv/wccpd/wccp/srv_grp/config/51
 S=/qv/wccpd/wccp/srv_grp/state/51
 fail() { echo "$*" >&2; cat "$LAB"/said "$LAB"/complained >&2; lab_show a1 2>/dev/null; exit 1; }
-as=() # whom
+as=() # command prefix that changes the user
 ctl() { lab_in a1 "${as[@]}" "$WCCP_BIN/mgmtctl" "$@"; }
-# The exit code, then what standard output has to match whole (a bash pattern, or after "jq:" an expression).
+# Runs mgmtctl and checks its exit status and whole standard output: a bash pattern, or after "jq:" a jq expression.
 expect() { # STATUS OUTPUT WORDS...
     local status=$1 wanted=$2 got; shift 2
     ctl "$@" >"$LAB/said" 2>"$LAB/complained"; got=$?
     [ $got = "$status" ] || fail "mgmtctl $*: status $got, not $status"
     if [[ $wanted == jq:* ]]; then
-        jq -e "${wanted#jq:}" <"$LAB/said" >/dev/null || fail "mgmtctl $*: not so: ${wanted#jq:}"
+        jq -e "${wanted#jq:}" <"$LAB/said" >/dev/null || fail "mgmtctl $*: not true: ${wanted#jq:}"
         return
     fi
     # shellcheck disable=SC2053
-    [[ $(<"$LAB/said") == $wanted ]] || fail "mgmtctl $*: output other than: $wanted"
+    [[ $(<"$LAB/said") == $wanted ]] || fail "mgmtctl $*: the output does not match: $wanted"
 }
-complains() { # PATTERN : and did, the last time
+complains() { # PATTERN : for the standard error of the last `expect`
     # shellcheck disable=SC2053
-    [[ $(<"$LAB/complained") == $1 ]] || fail "the complaint is not: $1"
+    [[ $(<"$LAB/complained") == $1 ]] || fail "standard error does not match: $1"
 }
-began() { date +%s%N; }
-took_ms() { echo $((($(date +%s%N) - $1) / 1000000)); }
 
 lab_router r1 10.0.0.1 -- --password geheim
 lab_appliance a1 10.0.0.101
@@ -48,22 +46,22 @@ complains 'mgmtctl: unknown word "gte"; known are get walk*'
 expect 2 '' set /a=1 /b
 expect 0 'mgmtctl [0-9]*' --version
 expect 0 '/qv/wccpd' complete /qv/wcc
-lab_in a1 test ! -e /tmp/gcl-socks || fail "a question leaves something behind"
+lab_in a1 test ! -e /tmp/gcl-socks || fail "mgmtctl left its socket directory"
 
-# --- A group that runs, and a watch from its start on
+# --- A running group, and a watch from its start
 
 lab_in a1 bash -c 'cp /etc/group /tmp/group; echo wccpd:x:2999: >>/tmp/group; mount --bind /tmp/group /etc/group'
-lab_appliance_start a1 "$(lab_group 51 10.0.0.1 password=geheim)" || fail "the appliance does not start"
+lab_appliance_start a1 "$(lab_group 51 10.0.0.1 password=geheim)" || fail "the appliance did not start"
 (ctl --json watch; echo "{\"ended\": $?}") >"$LAB/watched" &
 watch=$!
 (ctl watch "$G/wei*" "$G/weight" --count 2; echo "status $?") >"$LAB/watched-one" 2>&1 &
 watch_one=$!
-lab_wait_role 60 a1 51 ACTIVE || fail "the group does not become active"
+lab_wait_role 60 a1 51 ACTIVE || fail "the group did not become active"
 lab_wait 20 '.["51"].router["1"].appliance["10.0.0.101"].load_dist == 100' lab_state a1 || fail "no assignment"
 expect 0 '*wccp_group_active{group="51"} 1*# EOF' metrics
 ctl metrics --http <<<$'HEAD /metrics HTTP/1.1\r\nAccept: text/plain\r\n\r' | grep -q '^Content-Type: text/plain; version=0.0.4' ||
     fail "no metrics over HTTP"
-ctl metrics --http <<<$'GET / HTTP/1.1\r\n\r' | grep -q '^HTTP/1.1 404' || fail "metrics of something else"
+ctl metrics --http <<<$'GET / HTTP/1.1\r\n\r' | grep -q '^HTTP/1.1 404' || fail "no error 404 for another path"
 
 expect 0 100 get $G/weight
 expect 0 "$G/weight = 100"$'\n'"$G/password = [*][*][*][*][*][*][*][*]" get $G/weight $G/password
@@ -75,7 +73,7 @@ complains "mgmtctl: $G/policy_grp: is not set"$'\n'"*has no default"
 expect 4 '' walk /qv/nobody
 complains '*there is nothing below*'
 
-# --- The monitoring tree, whole: names and types, and the values that are known
+# --- The whole monitoring tree: names, types, and values as far as they are known
 
 expect 0 'jq:
     def dotted: test("^[0-9]+[.][0-9]+[.][0-9]+[.][0-9]+$");
@@ -106,13 +104,13 @@ expect 0 'jq:(map({key: (.name | ltrimstr("/qv/wccpd/system/state/")), value: .v
 expect 0 'jq:map(.name) == ["'$S'"]' --json walk --children "${S%/*}"
 expect 0 "*$S/debug ="$'\n    '"*$S/appliance/1/weight = 100*" walk /
 expect 4 '' get $S/router/1/speed
-# A number that isn't there reads as zeros, by design of the tree.
+# A state node of an entry that does not exist reads as zero, by design.
 expect 0 0.0.0.0 get $S/appliance/2/ipaddr
 
 # --- Changes
 
 expect 0 '' set $G/weight 7
-lab_wait 20 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight does not arrive"
+lab_wait 20 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight did not reach the router"
 expect 0 '' set $G/weight=9 $G/mask_dst_ip=0x7f
 expect 0 'jq:.[0].value == 127' --json get $G/mask_dst_ip
 expect 1 '' set $G/weight=70000 $G/priority=1
@@ -132,32 +130,32 @@ complains '*note: group 51: wccpd takes a change of router/1 only with the group
 expect 0 '' delete $G/mask_dst_ip
 expect 0 3840 get $G/mask_dst_ip
 
-# --- Alarms: the router goes away, and the group with it
+# --- Alarms: the router stops, and the group goes down
 
 expect 0 '' delete $G
 expect 0 'created*' set $G/interface=eth0 $G/router/1/ipaddr=10.0.0.1 $G/password=geheim
-lab_wait 60 '.["51"].router["1"].state == "TWO-WAY connected"' lab_state a1 || fail "the group is not created again"
+lab_wait 60 '.["51"].router["1"].state == "TWO-WAY connected"' lab_state a1 || fail "the group was not created again"
 expect 0 'no alarm is active' alarms --check
 lab_ctl r1 stop >/dev/null
 
-# Meanwhile: what a shell makes of it
+# Until the alarm: pipes, a full device, and shell completion
 
-(ctl walk / | true; exit "${PIPESTATUS[0]}"); [ $? = 141 ] || fail "a pipe that nobody reads"
-ctl walk / >/dev/full 2>"$LAB/complained"; [ $? = 7 ] || fail "a full device"
+(ctl walk / | true; exit "${PIPESTATUS[0]}"); [ $? = 141 ] || fail "wrong status for a pipe without a reader"
+ctl walk / >/dev/full 2>"$LAB/complained"; [ $? = 7 ] || fail "wrong status for a full device"
 complains 'mgmtctl: standard output: No space left on device'
-completed() { # WORD... : what the shell would offer
+completed() { # WORD... : prints what bash would offer
     lab_in a1 bash -c 'PATH=$1:$PATH; source "$2"; compopt() { :; }; shift 2
         COMP_WORDS=(mgmtctl "$@"); COMP_CWORD=$#; _mgmtctl; echo "${COMPREPLY[*]}"' - "$WCCP_BIN" "$top/packaging/mgmtctl.bash-completion" "$@"
 }
-ctl bypass add 10.0.0.0/8 >/dev/null && ctl intercept add 51 all to 3128 >/dev/null || fail "mgmtd refuses an intercept"
+ctl bypass add 10.0.0.0/8 >/dev/null && ctl intercept add 51 all to 3128 >/dev/null || fail "mgmtd refused an intercept"
 [ "$(completed bypass delete 10.0.0.0/)" = 10.0.0.0/8 ] && [ "$(completed intercept set '')" = 51 ] &&
     [ "$(completed intercept set 51 ch)" = check ] && [ "$(completed intercept set 51 rest d)" = drop ] ||
-    fail "the shell completes words of redirected traffic otherwise"
+    fail "completion of bypass and intercept"
 expect 0 'jq:.intercepts[0] | .group == 51 and .active == false' --json intercept show 051 # no router has assigned yet
 ctl bypass delete 10.0.0.0/8 >/dev/null; ctl intercept delete 51 >/dev/null
 [ "$(completed al)" = alarms ] && [ "$(completed get "${G%1}")" = $G ] && [ "$(completed group set '')" = 51 ] &&
     [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&
-    [ "$(completed walk --le)" = --leaves ] || fail "the shell completes otherwise"
+    [ "$(completed walk --le)" = --leaves ] || fail "completion of alarms, get, group, set and walk"
 if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
     as=(setpriv --reuid 65534 --regid 65534 --clear-groups)
     expect 3 '' get $G/weight
@@ -168,7 +166,7 @@ if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
     for words in "get $G/password" 'walk /' "get $S/debug" export 'export --json' "get /mgmtd/config/state/text" 'diff 1 2'; do
         # shellcheck disable=SC2086
         ctl $words --secrets >"$LAB/said" 2>"$LAB/complained" && [ -s "$LAB/said" ] && ! grep -q geheim "$LAB/said" ||
-            fail "a viewer's $words"
+            fail "$words --secrets by a viewer"
     done
     expect 1 '' set $G/weight 7
     complains 'mgmtctl: user 65534 may look, but not change anything'
@@ -176,7 +174,7 @@ if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
     as=()
 fi
 
-# The configuration as a whole
+# Export, apply, history, rollback
 
 ctl export >"$LAB/exported"
 expect 0 'nothing to change' apply --check - <"$LAB/exported"
@@ -193,53 +191,54 @@ expect 0 'commit * confirmed' confirm
 expect 4 '' confirm
 expect 0 'add    /qv/wccpd/wccp/policy_grp/config/5 = 5' diff
 last=$(ctl --json history | jq '.[1].commit')
-[[ " $(completed rollback '') " == *" $last "* ]] || fail "the shell does not complete commits"
+[[ " $(completed rollback '') " == *" $last "* ]] || fail "completion of commits"
 expect 0 $'delete /qv/wccpd/wccp/policy_grp/config/5 (was 5)\ncommit *' rollback "$last"
 expect 4 '' diff 9999
 lab_in a1 tee /tmp/applied <"$LAB/applied" >/dev/null
 for answer in n y; do
     lab_in a1 script -qec "'$WCCP_BIN/mgmtctl' apply /tmp/applied" /dev/null <<<$answer >"$LAB/said" 2>&1
-    [ $? = "$([ $answer = y ] && echo 0 || echo 1)" ] && grep -q 'apply this? \[y/N\]' "$LAB/said" || fail "asked, and answered $answer"
+    [ $? = "$([ $answer = y ] && echo 0 || echo 1)" ] && grep -q 'apply this? \[y/N\]' "$LAB/said" || fail "apply with the answer $answer"
 done
 expect 0 5 get /qv/wccpd/wccp/policy_grp/config/5
 expect 0 '' delete /qv/wccpd/wccp/policy_grp/config/5
 
-lab_wait_event 60 a1 '^alarm raised: .*51' || fail "no alarm of a router that is gone"
+lab_wait_event 60 a1 '^alarm raised: .*51' || fail "no alarm for the router"
 expect 6 '*adjacency*grp:51*' alarms --check
 expect 0 'jq:.[0] | .type == 196638 and .name == "adjacency" and (.source | endswith(":grp:51")) and
     (.reporter | startswith("wccpd-")) and (.since | length) == 19' --json alarms
 lab_ctl r1 resume >/dev/null
 
-# Meanwhile: mgmtd is stopped
+# Until the alarm is cleared: mgmtd is stopped
 
 mgmtd=$(lab_pid a1 mgmtd)
 kill -STOP "$mgmtd"
-at=$(began)
+began=$EPOCHREALTIME
 expect 3 '' --timeout 0.5 get $G/weight
 complains 'mgmtctl: mgmtd gave no answer in 0.500 s'
-[ "$(completed get "${G%1}")" = '' ] || fail "completion says something"
-[ "$(took_ms "$at")" -lt 6000 ] || fail "a stopped mgmtd holds a person up for $(took_ms "$at") ms"
+[ "$(completed get "${G%1}")" = '' ] || fail "completion prints something"
+took_ms=$(((${EPOCHREALTIME/./} - ${began/./}) / 1000))
+[ $took_ms -lt 6000 ] || fail "with mgmtd stopped, get and completion took $took_ms ms"
 lab_start a1 asking mgmtctl get $G/weight
 until [ -n "$(lab_pid a1 asking)" ]; do sleep 0.1; done
 sleep 0.3
-lab_stop a1 asking 2>/dev/null; [ $? = 143 ] || fail "a question that is ended by a signal"
+lab_stop a1 asking 2>/dev/null; [ $? = 143 ] || fail "mgmtctl did not end by the signal"
 kill -CONT "$mgmtd" "${LAB_PID[a1/mgmtd]}"
 expect 0 100 get $G/weight
 
-lab_wait_event 60 a1 '^alarm cleared: .*51' || fail "the alarm stays"
+lab_wait_event 60 a1 '^alarm cleared: .*51' || fail "the alarm was not cleared"
 expect 0 '[[]]' --json alarms --check
 
-# --- Several things broken on purpose
+# --- explain: faults made on purpose
 
-explanation() { ctl --json explain "$1" || [ $? = 1 ]; }
-explains() { # GROUP CODE WORDS : within some seconds the first reason of the group, with its cause
+print_explanation() { ctl --json explain "$1" || [ $? = 1 ]; }
+explains() { # GROUP CODE WORDS : within some seconds the first reason of the group has this code, and WORDS in its cause
     lab_wait 20 "[.reasons[] | select(.group == $1 and .attention)][0] | .reason == \"$2\" and (.cause | contains(\"$3\"))" \
-        explanation "$1" || fail "explain $1 does not say $2: $3"
+        print_explanation "$1" || fail "explain $1 does not report $2: $3"
 }
 expect 0 '*nothing needs attention*' explain 51
 for broken in 'add 60 interface eth9 router 10.0.0.1' 'add 61 interface eth0 router 10.0.0.77' 'add 62'; do
     # shellcheck disable=SC2086
-    ctl group $broken >/dev/null || fail "mgmtd refuses group $broken"
+    ctl group $broken >/dev/null || fail "mgmtd refused group $broken"
 done
 explains 60 interface-missing 'no interface eth9'
 explains 61 no-answer '10.0.0.77 does not answer'
@@ -258,34 +257,34 @@ expect 1 '*group 51 *service-mismatch: *[0-9] ago*next: *' explain
 expect 0 '*51  * !*10.0.0.1 has the service with priority 201*' show
 lab_ctl r1 fault none >/dev/null
 for broken in 60 61 62; do ctl group delete $broken >/dev/null; done
-lab_wait 20 '.attention == false' ctl --json explain 51 || fail "a reason stays"
+lab_wait 20 '.attention == false' ctl --json explain 51 || fail "a reason is left"
 expect 2 '' explain 300
 
 # --- wccpd stopped, mgmtd killed
 
 kill -STOP "$(lab_pid a1 wccpd)"
 expect 3 '*wccpd does not answer*' show
-[[ $(<"$LAB/said") != *'no alarm'* ]] || fail 'no alarm, says show without wccpd'
+[[ $(<"$LAB/said") != *'no alarm'* ]] || fail 'show reports "no alarm" without wccpd'
 expect 3 '*wccpd-silent*' alarms --check
 expect 1 'jq:.reasons[0].reason == "wccpd-silent"' --json explain
 ctl walk /qv >"$LAB/walked" 2>&1 &
 walk=$!
 expect 3 '' get $S/oper
 complains "mgmtctl: $S/oper: wccpd-* did not answer in time"
-wait $walk && grep -q "^$G/weight = " "$LAB/walked" || fail "the walk waits for wccpd in vain"
+wait $walk && grep -q "^$G/weight = " "$LAB/walked" || fail "the walk did not skip wccpd"
 kill -CONT "$(lab_pid a1 wccpd)" "${LAB_PID[a1/wccpd]}"
 expect 0 '?*' get $S/oper
-if lab_in a1 chown 1 /tmp/gcl-socks/uds-provider-mgmtd; then # not where only one user is known
+if lab_in a1 chown 1 /tmp/gcl-socks/uds-provider-mgmtd; then # fails in a user namespace with one user
     expect 3 '' get $S/oper
     complains "mgmtctl: /tmp/gcl-socks/uds-provider-mgmtd belongs to user 1; *"
     lab_in a1 chown 0 /tmp/gcl-socks/uds-provider-mgmtd
 fi
-! lab_in a1 ls /tmp/gcl-socks | grep mgmtctl || fail "questions leave sockets behind"
+! lab_in a1 ls /tmp/gcl-socks | grep mgmtctl || fail "mgmtctl left sockets"
 
 wait $watch_one
 [ "$(cut -d' ' -f2- <"$LAB/watched-one")" = "modify $G/weight = 7 (was 100)
 modify $G/weight = 9 (was 7)
-0" ] || { cat "$LAB/watched-one" >&2; fail "the watch of one node"; }
+0" ] || { cat "$LAB/watched-one" >&2; fail "wrong output of the watch of one node"; }
 lab_stop a1 mgmtd KILL 2>/dev/null
 wait $watch
 jq -s -e 'def one(f): [.[] | select(f)] | length == 1;
@@ -295,7 +294,7 @@ jq -s -e 'def one(f): [.[] | select(f)] | length == 1;
     and any(.[]; .event == "role" and .group == 51 and .role == "ACTIVE")
     and all(("alarm_raised", "alarm_cleared") as $event | any(.[]; .event == $event and .name == "adjacency"); .)
     and all(.[:-2][]; .time | test("^20..-..-..T..:..:..[+-]....$"))' <"$LAB/watched" >/dev/null ||
-    { cat "$LAB/watched" >&2; fail "the watch has seen something else"; }
+    { cat "$LAB/watched" >&2; fail "wrong output of the watch"; }
 expect 3 '' get $G/weight
 complains 'mgmtctl: mgmtd is not running (nothing listens at *)'
 exit 0

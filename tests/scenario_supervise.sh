@@ -1,7 +1,7 @@
 #!/bin/bash
-# mgmtd starts the appliance's programs with their options and keeps them: both sessions open, a tunneld that crashes
-# is replaced unnoticed, one that is ended takes wccpd with it and both come back, a file edited by hand reaches wccpd,
-# a program that doesn't end is made to, and nothing outlives an mgmtd that is killed.
+# mgmtd --supervise starts tunneld and wccpd with their options. A tunneld that crashes is replaced without wccpd noticing;
+# one that exits makes wccpd restart as well. SIGHUP applies an edited file, a program that does not exit is killed, and
+# no program outlives an mgmtd that is killed.
 #   scenario_supervise.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
@@ -18,54 +18,55 @@ ip link set eth0 up && ip link set eth1 up
 printf '[/qv/wccpd/wccp/srv_grp/config/51]\ninterface = eth0\nrouter/1/ipaddr = 10.0.0.1\n' >$config
 
 die() { echo "$*" >&2; cat $out >&2; exit 1; }
-says() { # SECONDS COUNT PATTERN
+wait_line() { # SECONDS COUNT PATTERN
     local i
     for ((i = 0; i < $1 * 10; i++)); do
         [ "$(grep -cE "$3" $out)" -ge "$2" ] && return
         sleep 0.1
     done
-    die "not said $2 times: $3"
+    die "not $2 lines in the output of mgmtd: $3"
 }
-start() { # however it was started: a caller may have ignored the signal that tells of a child's end
+# SIGCHLD may be ignored by whatever starts mgmtd, and it notices the exit of its programs nevertheless.
+start_mgmtd() {
     : >$out
     env --ignore-signal=CHLD "$bin/mgmtd" --config $config --supervise --wccpd "$bin/wccpd" --tunneld " $bin/tunneld  --plane table" >$out 2>&1 &
     mgmtd=$!
-    says 20 2 "^session of wccpd-[0-9]+ open"
-    says 20 1 "^role of group 51: BACKUP"
+    wait_line 20 2 "^session of wccpd-[0-9]+ open"
+    wait_line 20 1 "^role of group 51: BACKUP"
 }
 pid_of() { sed -n "s/^process $1: started, pid //p" $out | tail -n 1; }
 
-! "$bin/mgmtd" --config $config --supervise --tunneld ' ' >$out 2>&1 || die "started without a program"
-start
+! "$bin/mgmtd" --config $config --supervise --tunneld ' ' >$out 2>&1 || die "mgmtd accepted an empty command"
+start_mgmtd
 [ "$(tr '\0' ' ' <"/proc/$(pid_of tunneld)/cmdline")" = "$bin/tunneld --plane table " ] || die "the options of tunneld"
 first=$(pid_of wccpd)
-says 10 1 "^session of tunneld-[0-9]+ open"
-sleep 0.6 # a run that is shorter counts as one that failed to start
+wait_line 10 1 "^session of tunneld-[0-9]+ open"
+sleep 0.6 # a program that exits earlier counts as one that failed to start
 kill -KILL "$(pid_of tunneld)"
-says 10 1 "^process tunneld: ended by SIGKILL, replaced after [0-9]+ ms"
-says 10 2 "^session of tunneld-[0-9]+ open"
-[ "$(pid_of wccpd)" = "$first" ] && kill -0 "$first" || die "wccpd has noticed"
+wait_line 10 1 "^process tunneld: ended by SIGKILL, replaced after [0-9]+ ms"
+wait_line 10 2 "^session of tunneld-[0-9]+ open"
+[ "$(pid_of wccpd)" = "$first" ] && kill -0 "$first" || die "wccpd was restarted"
 kill -TERM "$(pid_of tunneld)"
-says 10 1 "^process tunneld: /pm/events/failure/unexpected_exit"
-says 10 1 "^process wccpd: exited with 0, starts again in 1 s"
-says 20 4 "^session of wccpd-[0-9]+ open"
-[ "$(pid_of wccpd)" != "$first" ] || die "wccpd is the same"
+wait_line 10 1 "^process tunneld: /pm/events/failure/unexpected_exit"
+wait_line 10 1 "^process wccpd: exited with 0, starts again in 1 s"
+wait_line 20 4 "^session of wccpd-[0-9]+ open"
+[ "$(pid_of wccpd)" != "$first" ] || die "wccpd was not restarted"
 
 sed -i 's/^interface.*/&\nweight = 7/' $config
 kill -HUP $mgmtd
-says 5 1 "^configuration read again: 1 nodes changed"
+wait_line 5 1 "^configuration read again: 1 nodes changed"
 
 kill -STOP "$(pid_of wccpd)"
 kill -TERM $mgmtd
-wait $mgmtd || die "mgmtd ended with $?"
-says 1 1 "^process wccpd: does not end, killed"
-says 1 1 "^process tunneld: exited with 0"
+wait $mgmtd || die "mgmtd exited with $?"
+wait_line 1 1 "^process wccpd: does not end, killed"
+wait_line 1 1 "^process tunneld: exited with 0"
 [ ! -e /tmp/gcl-socks/uds-provider-mgmtd ] || die "the socket is left"
 
-# The next mgmtd starts while the programs of the killed one are still ending.
-start
+# The next mgmtd starts while the programs of the killed one are still exiting.
+start_mgmtd
 kill -KILL $mgmtd
-start
+start_mgmtd
 programs=("$(pid_of wccpd)" "$(pid_of tunneld)")
 kill -KILL $mgmtd
 for ((i = 0; i < 50; i++)); do
