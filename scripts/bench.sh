@@ -1,7 +1,7 @@
 #!/bin/bash
-# bench.sh: the project's benchmarks in one run, each figure beside the floor that was measured with it; then the real
-# programs: how the start grows with the number of groups, the daemon's memory by room, and how long the engine's lock
-# is held while mgmtd is stopped. Figures of two runs are compared as ratios to their own floors, never as times.
+# bench.sh: runs all benchmarks. The micro-benchmarks print each figure with a baseline measured in the same run; compare
+# two runs by the ratios to their baselines, not by times. Then the real programs: the start of wccpd by the number of
+# groups, its memory by use, and how long the engine's lock is held while mgmtd is stopped.
 set -eu
 cd "$(dirname "$0")/.."
 scripts/install-deps.sh build lab test
@@ -12,7 +12,7 @@ for program in build/release/bin/*_bench; do
     printf '\n== %s\n' "${program##*/}"
     lab/in-appliance "$program" --benchmark_min_time="${MIN_TIME:-0.2}" 2>/dev/null
 done
-printf '\n== the start of the daemon and its memory, with groups of 32 routers\n'
+printf '\n== start of wccpd and its memory, with groups of 32 routers\n'
 bench/daemon_start.sh "$PWD/build/release/bin"
-printf '\n== the engine while mgmtd is stopped\n'
+printf '\n== the lock of the engine while mgmtd is stopped\n'
 bench/mgmtd_stopped.sh "$PWD/build/release/bin"

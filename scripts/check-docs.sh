@@ -1,11 +1,11 @@
 #!/bin/bash
-# check-docs.sh: what the documents quote exists. Quoted is what is in backticks or in an indented block, and the
-# target of a link.
-#   Files     a path that begins with a directory of the tree, and a bare name of a source file or script
-#   mgmtctl   the command is one of peers/mgmtctl/main.cpp; further words and options are texts of its sources.
-#             docs/mgmtctl.md has each command
-#   Options   of mgmtd, tunneld and the scripts: words of their sources
-#   Steps     of scripts/test.sh: CONTRIBUTING.md has each
+# check-docs.sh: checks that what the documents quote exists. Quotations are text in backticks, indented blocks and the
+# targets of links.
+#   Files     paths that begin with a directory of the tree, and bare names of source files and scripts
+#   mgmtctl   commands, against peers/mgmtctl/main.cpp; their words and options, against the strings in its sources.
+#             Each command has to be in docs/mgmtctl.md
+#   Options   of mgmtd, tunneld and the scripts, against their sources
+#   Steps     of scripts/test.sh: each has to be in CONTRIBUTING.md
 set -eu
 cd "$(dirname "$0")/.."
 documents=(README.md CONTRIBUTING.md CHANGELOG.md docs/*.md)
@@ -13,12 +13,12 @@ tree=$(git ls-files -co --exclude-standard)
 directories=$(sed -n 's,/.*,,p' <<<"$tree" | grep -v '^\.' | sort -u | paste -sd'|')
 ctl_sources=(peers/mgmtctl/*.cpp peers/nodes/*.cpp)
 status=0
-missing() { # DOCUMENT WHAT
+missing() { # DOCUMENT TEXT
     echo "$1: $2"
     status=1
 }
 
-# One quotation a line. A "|" of a table is written "\|".
+# Prints one quotation per line. Tables have "\|" for "|".
 quotations() { # DOCUMENT
     sed -n 's/\\|/|/g; s/^    \(.*\)/\1/p; t' "$1"
     grep -v '^    ' "$1" | sed 's/\\|/|/g' | grep -oE '`[^`]+`' | tr -d '`' || true
@@ -39,7 +39,7 @@ check_files() { # DOCUMENT
     done < <(grep -oP '\]\(\K[^)#:]+(?=[)#])' "$1" | sort -u)
 }
 
-is_text_of() { # WORD FILE... : as a whole text, or a word of one that lists words
+is_text_of() { # WORD FILE... : a string, or a word of a string that lists words
     grep -qE "\"([^\"]*[ ,:[|])?$1([] ,:|=][^\"]*)?\"" "${@:2}"
 }
 commands=$(sed -n 's/.*add_command([a-z]*, "\([a-z]*\)".*/\1/p' peers/mgmtctl/main.cpp)
@@ -59,7 +59,7 @@ check_words() { # DOCUMENT
             [a-z]*) is_text_of "$word" "${ctl_sources[@]}" || missing "$1" "mgmtctl knows no word $word" ;;
             esac
         done
-    # Left out: what is drawn, a second command, the operator's own names and files.
+    # Removed before the check: separator lines, a second command, and names and files that the operator chooses.
     done < <(quotations "$1" | grep -oP '(^ *|[#$;&] |sudo )mgmtctl \K[^<>#"()]+' |
         sed -E 's/---.*//; s/[;&|] *[a-z].*//; s/\b(interface|name|password) [a-z][a-z0-9.]*/\1/g; s/ [^ ]+\.(conf|json)\b//g; s/:.*//' | sort -u)
 }
@@ -93,5 +93,5 @@ done
 for step in $(sed -n 's/^#.*only these steps, of: //p' scripts/test.sh); do
     grep -q "\`$step\`" CONTRIBUTING.md || missing CONTRIBUTING.md "scripts/test.sh has a step $step"
 done
-[ $status = 0 ] || echo "check-docs.sh: what is quoted there does not exist" >&2
+[ $status = 0 ] || echo "check-docs.sh: the documents quote what does not exist" >&2
 exit $status

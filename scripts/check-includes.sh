@@ -1,5 +1,6 @@
 #!/bin/bash
-# check-includes.sh: no room includes a higher one. One row for each room: the rooms that its files may include.
+# check-includes.sh: checks that no room (top-level directory) includes a higher one. Each row lists the rooms that the
+# files of a room may include.
 set -eu
 cd "$(dirname "$0")/.."
 declare -A may=(
@@ -11,7 +12,7 @@ declare -A may=(
     [peers]="runtime mgmt platform peers"
     [lab]="runtime mgmt platform peers lab"
 )
-# Alarms leave the engine as management events.
+# The exception: alarms leave the engine as management events.
 alarms='^engine/wccp_alarm[a-z_]*\.(cpp|h):'
 status=0
 for room in "${!may[@]}"; do
@@ -19,5 +20,5 @@ for room in "${!may[@]}"; do
         { if [ "$room" = engine ]; then grep -vE "$alarms.*\"mgmt/"; else cat; fi; } || true)
     [ -z "$found" ] || { printf '%s\n' "$found"; status=1; }
 done
-[ $status = 0 ] || echo "check-includes.sh: these includes leave their room upwards" >&2
+[ $status = 0 ] || echo "check-includes.sh: these rooms may not include each other" >&2
 exit $status

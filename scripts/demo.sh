@@ -1,16 +1,16 @@
 #!/bin/bash
 # demo.sh [--capture FILE] [--plain] [--speed N] [--no-build]
-# A client, a server, a router that redirects, and two appliances with a proxy each, in namespaces of their own: one
-# joins, and downloads run through it; the other joins, the designated one shares 256 hash buckets by weight, and pages
-# that the client fetches come through the proxies in these shares, while the downloads go on. Then the proxy of one is
-# killed, and starts again; then the whole appliance dies. The fetches go on. On a terminal `mgmtctl show --watch` of the
-# appliance that survives stays on the screen, below what is awaited, for how long, and by whom the last pages came;
-# without one there is a line for each step. Takes some 75 seconds, installs and builds what is missing, leaves nothing
-# running.
-#   --capture FILE   keep the packets of the protocol and of redirected flows, for tshark or wireshark
-#   --plain          lines, on a terminal as well
-#   --speed N        all protocol times N times as fast (default 2)
-#   --no-build       take the programs from $WCCP_BIN
+# A client, a server, a router that redirects, and two appliances with a proxy each, in namespaces of their own. One
+# appliance joins, and downloads run through it. The other joins, and the designated one distributes 256 hash buckets by
+# weight: pages that the client fetches come through both proxies in these proportions, while the downloads go on. Then a
+# proxy is killed and started again; then its whole appliance dies. The fetches go on. On a terminal the demo shows what
+# it waits for, who has answered the last fetches, and below that `mgmtctl show --watch` of the appliance that survives.
+# Without a terminal it prints a line for each step. Takes some 75 seconds, installs and builds what is missing, and
+# leaves nothing running.
+#   --capture FILE   write the packets of the protocol and of redirected flows to FILE, for tshark or wireshark
+#   --plain          print lines on a terminal as well
+#   --speed N        run the protocol N times as fast as real time (default 2)
+#   --no-build       use the programs in $WCCP_BIN
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
 capture='' plain='' build=yes
@@ -22,7 +22,7 @@ while [ $# -gt 0 ]; do
     --capture) capture=$(readlink -f "${2?a file}") || exit 2; shift 2 ;;
     --plain) plain=yes; shift ;;
     --speed)
-        [[ ${2?a number} =~ ^[1-9][0-9]*(\.[0-9]+)?$ ]] || { echo "demo: a speed of $2?" >&2; exit 2; }
+        [[ ${2?a number} =~ ^[1-9][0-9]*(\.[0-9]+)?$ ]] || { echo "demo: --speed $2: not a positive number" >&2; exit 2; }
         export LAB_SPEED=$2; shift 2 ;;
     --no-build) build=''; shift ;;
     *) sed -n '2,13s/^# \{0,1\}//p' "$0"; exit 2 ;;
@@ -30,10 +30,10 @@ while [ $# -gt 0 ]; do
 done
 own_rows=7
 exec {screen}>&1
-measure() { # sets `rows` and `columns` of the terminal
+measure_terminal() { # sets `rows` and `columns`
     read -r rows columns < <(stty size <&"$screen" 2>/dev/null)
 }
-measure
+measure_terminal
 [ "${TERM-dumb}" != dumb ] && [ "${rows:-0}" -ge $((own_rows + 12)) ] && [ "${columns:-0}" -ge 60 ] || plain=yes
 
 if [ "${LAB_INSIDE-}" != 1 ] && [ -n "$build" ]; then
@@ -50,95 +50,95 @@ export WCCP_BIN
 # shellcheck source=../lab/topology.sh
 source "$top/lab/topology.sh"
 
-# The outer side has the terminal: whatever ends the demo, it waits until nobody inside can write any more (each of
-# them holds the pipe), gives the screen back, and then shows what was told meanwhile.
-give_back() {
+# The process outside the namespaces owns the terminal. When the demo ends, for whatever reason, it waits until no process
+# inside can write any more (all of them hold the pipe open), restores the screen, and then prints the collected lines.
+restore_terminal() {
     local nothing
     trap '' INT TERM HUP
-    exec 2>/dev/null {everybody}>&- # no word of the shell's about what was killed
-    read -r -t 5 nothing <&"$everybody_gone"
+    exec 2>/dev/null {alive}>&- # suppresses the shell's messages about killed processes
+    read -r -t 5 nothing <&"$all_ended"
     printf '\033[0m\033[?25h\033[?1049l'
-    cat <&"$told"
+    cat <&"$collected"
 }
 if [ -z "$plain" ] && [ "${LAB_INSIDE-}" != 1 ]; then
     scratch=$(mktemp -d) || exit 1
     mkfifo "$scratch/pipe" || exit 1
-    exec {both}<>"$scratch/pipe" {everybody_gone}<"$scratch/pipe" {everybody}>"$scratch/pipe"
-    exec {tell}>"$scratch/told" {told}<"$scratch/told"
+    exec {both}<>"$scratch/pipe" {all_ended}<"$scratch/pipe" {alive}>"$scratch/pipe"
+    exec {lines_fd}>"$scratch/lines" {collected}<"$scratch/lines"
     exec {both}>&-
     rm -r "$scratch"
-    export tell
-    trap give_back EXIT
+    export lines_fd
+    trap restore_terminal EXIT
     trap 'exit 130' INT
     trap 'exit 143' TERM HUP
-    trap '' TSTP # there is nothing to come back to
+    trap '' TSTP # the screen could not be restored
     printf '\033[?1049h\033[?25l\033[H\033[J'
 fi
 lab_enter "$0" "${arguments[@]}"
-[ -n "$plain" ] || exec 2>&"$tell"
+[ -n "$plain" ] || exec 2>&"$lines_fd"
 
-# ---- who takes part
+# --- Who takes part
 
 declare -A address=([r1]=10.0.0.1 [a1]=10.0.0.101 [a2]=10.0.0.102) weight=([a1]=60 [a2]=100)
 survivor=a2
 everyone="client c1, server s1, router r1 ${address[r1]}, appliances a1 ${address[a1]} a2 ${address[a2]}"
 
-# ---- the output: lines with the time of the protocol's clock
+# --- Output: lines with the time of the protocol's clock
 
 began_us=${EPOCHREALTIME/[.,]/}
 speed_milli=$(awk "BEGIN { printf \"%d\", $LAB_SPEED * 1000 }")
-clock() { # sets `now`, seconds of the protocol since the beginning
+read_clock() { # sets `now`: seconds since the start, in the time of the protocol
     now=$(((${EPOCHREALTIME/[.,]/} - began_us) * speed_milli / 1000000000))
 }
-say() {
+print_line() {
     local now line
-    clock
+    read_clock
     printf -v line '%d:%02d %s\n' $((now / 60)) $((now % 60)) "$*"
-    if [ -n "$plain" ]; then printf '%s' "$line"; else printf '%s' "$line" >&"$tell"; fi
+    if [ -n "$plain" ]; then printf '%s' "$line"; else printf '%s' "$line" >&"$lines_fd"; fi
 }
 
 step='' awaited='' expected=0 step_began=0
-tell_step() {
+begin_step() { # TEXT
     step=$1 expected=0
-    say "$step"
+    print_line "$step"
     [ -n "$plain" ] || draw
 }
-typed=('' '') # two lines of what was typed last
+typed=('' '') # the last command, in two lines
 
-# The words that an operator would type, in one of the appliances.
-operate() { # APPLIANCE WORDS OF mgmtctl...
+# Runs mgmtctl in an appliance, as an operator would.
+run_mgmtctl() { # APPLIANCE WORDS...
     local command answer node=$1 rest; shift
     command="$node# mgmtctl $*"
-    say "  $command"
+    print_line "  $command"
     rest=${command:${columns:=80}-1}
     typed=("${command:0:columns-1}" "    $rest")
     [ -n "$plain" ] || draw
-    answer=$(lab_in "$node" "$WCCP_BIN/mgmtctl" "$@") || lab_die "$node refuses: $*"
-    say "  $answer"
+    answer=$(lab_in "$node" "$WCCP_BIN/mgmtctl" "$@") || lab_die "mgmtctl $* failed in $node"
+    print_line "  $answer"
     [ -n "$rest" ] || typed[1]="    $answer"
 }
 
-# ---- what is seen: of the routers' side by asking them, of the appliances' by mgmtctl
+# --- State: that of the router by its control socket, that of the appliances by mgmtctl
 
 members='' seen='{}' pages='' fetched='{}'
-look() {
+read_state() {
     members=$(lab_ctl r1 members 51)
     seen=$(lab_manage $survivor show)
     fetch_pages 32 0.4
 }
-# Pages for so many addresses of the client; who has answered.
+# Fetches a page from each of so many addresses of the client; `pages` becomes a line that says who answered.
 fetch_pages() { # COUNT TIMEOUT
     fetched=$(lab_fetch c1 --count "$1" --sources "$1" --parallel "$1" --timeout "$2")
     pages=$(jq -r '(.fetched + .failed) as $all | def part: "\(.) (\(100 * . / $all | round)%)";
         "of \($all) pages a1 \(.proxies.a1 // 0 | part)  a2 \(.proxies.a2 // 0 | part)  server alone \(.proxies[""] // 0 | part)  none \(.failed | part)"' \
         <<<"$fetched")
 }
-# In a line, what 120 addresses of the client get.
+# Fetches pages from 120 addresses of the client and prints who answered.
 browse() {
     fetch_pages 120 1
-    say "  c1: $pages"
+    print_line "  c1: $pages"
 }
-# They last while a1 joins, and some ten seconds of the protocol longer.
+# The downloads last until some ten seconds, in the time of the protocol, after a1 has joined.
 downloads=16
 begin_downloads() {
     local rate=100000
@@ -146,18 +146,18 @@ begin_downloads() {
         --count $downloads --parallel $downloads --rate $rate --size "$((rate * 1000 * 36 / speed_milli + rate * 3))" \
         </dev/null >"$LAB/downloads" 2>>"$LAB/c1.out" &
     LAB_PID[c1/downloads]=$!
-    say "  c1: $downloads downloads begin, $((rate / 1000)) kB/s each"
+    print_line "  c1: $downloads downloads begin, $((rate / 1000)) kB/s each"
 }
 downloads_are_over() { ! lab_alive c1 downloads; }
-tell_downloads() {
+print_downloads() {
     local passed
     passed=$(lab_manage a1 get /qv/tunneld/protection/state/passed | jq -r '[.. | .value? // empty][0]')
-    say "  c1: of $downloads downloads $(jq -r '"\(.fetched) complete, \(.failed) broken; by a2 \(.proxies.a2 // 0)"' "$LAB/downloads"); a1 passed $passed packets of them to a2"
+    print_line "  c1: of $downloads downloads $(jq -r '"\(.fetched) complete, \(.failed) broken; by a2 \(.proxies.a2 // 0)"' "$LAB/downloads"); a1 passed $passed packets of them to a2"
     [ "$(jq .failed "$LAB/downloads")" = 0 ] || lab_die "downloads broke: $(cat "$LAB/downloads")"
 }
-fact() { # GROUP : in a line
+print_group() { # GROUP
     # shellcheck disable=SC2016
-    say "  $(jq -r --argjson id "$1" --arg node $survivor '
+    print_line "  $(jq -r --argjson id "$1" --arg node $survivor '
         {"10.0.0.101": "a1", "10.0.0.102": "a2"} as $names |
         .groups[] | select(.id == $id) |
         "group \($id): \($node) is \(.state)\(if .designated then ", designated" else "" end)" +
@@ -167,11 +167,11 @@ fact() { # GROUP : in a line
         "; " + (.appliances | "asked " + (map("\(.asked_percent)%") | join(", ")) + "; has " + (map("\(.share_percent)%") | join(", ")))' <<<"$seen")"
 }
 
-# The rows above the live picture, in one piece, since that is drawn by another process.
+# Draws the rows above `mgmtctl show` with a single write, because mgmtctl, another process, draws as well.
 draw() {
     local now text row gone bar='' i cells=20 lines styles=(0 1 0 32 36 36 2)
-    clock
-    measure
+    read_clock
+    measure_terminal
     gone=$((now - step_began))
     for ((i = 0; i < cells; i++)); do
         if [ $((i * expected)) -lt $((gone * cells)) ]; then bar+='#'; else bar+='.'; fi
@@ -188,58 +188,58 @@ draw() {
     printf '%s' "$text"
 }
 
-live() { # begins | ends : the picture below
+switch_show() { # on | off : `mgmtctl show --watch`
     [ -z "$plain" ] || return 0
-    if [ "$1" = begins ]; then
+    if [ "$1" = on ]; then
         (cd / && exec nsenter -t "${LAB_INIT[$survivor]}" --net --mount --root --ipc --pid \
             "$WCCP_BIN/mgmtctl" show --watch --below $own_rows) </dev/null 2>>"$LAB/show.out" &
         LAB_PID[$survivor/show]=$!
     else
-        lab_stop $survivor show || lab_die "the live picture ended with $?"
+        lab_stop $survivor show || lab_die "mgmtctl show exited with $?"
     fi
 }
 
-await() { # LIMIT EXPECTED WHAT CONDITION... : seconds of the protocol
+await() { # LIMIT EXPECTED WHAT CONDITION... : in seconds of the protocol's time
     local limit=$1 now wall=$SECONDS; expected=$2 awaited=$3; shift 3
-    clock
+    read_clock
     step_began=$now
-    say "  waiting for $awaited: about $expected s"
+    print_line "  waiting for $awaited: about $expected s"
     while :; do
-        look
+        read_state
         [ -n "$plain" ] || draw
         if "$@"; then break; fi
-        # The programs themselves are no faster by the faster clock.
+        # The extra 10 seconds are for the work of the programs, which the faster clock does not speed up.
         if [ $(((SECONDS - wall - 10) * speed_milli / 1000)) -ge "$limit" ]; then
-            echo "demo: after $limit s still no $awaited" >&2
+            echo "demo: timeout of $limit s while waiting for $awaited" >&2
             printf '%s\n' "$members" "$fetched" "$seen" >&2
             tail -n 5 "$LAB"/*.log "$LAB"/*.out >&2
             exit 1
         fi
         sleep 0.4
     done
-    clock
-    say "  after $((now - step_began)) s"
+    read_clock
+    print_line "  after $((now - step_began)) s"
     expected=0
 }
 
-# ---- conditions
+# --- Conditions
 
 members_are() { # COUNT
     [ "$(grep -c . <<<"$members")" = "$1" ]
 }
-asked() { grep -q ' 1$' <<<"$members" || members_are 1; }
-group_is() { # JQ : what the survivor says of it
+member_is_queried() { grep -q ' 1$' <<<"$members" || members_are 1; }
+group_is() { # JQ : in the state that the surviving appliance reports
     jq -e ".groups[] | select(.id == 51) | $1" <<<"$seen" >/dev/null 2>&1
 }
-pages_are() { # JQ : of those of the last look
+pages_are() { # JQ : over the result of the last fetch_pages
     jq -e "$1" <<<"$fetched" >/dev/null
 }
 # Every bucket of the one table has an owner, and the appliances have these shares.
 shares='(.tables | length == 1 and all(.[].buckets[]; .appliance)) and (.appliances | map(.share_percent))'
 
-# ---- the story
+# --- The steps
 
-tell_step "Start of $everyone"
+begin_step "Start of $everyone"
 lab_router r1 ${address[r1]} -- --redirect c1=51 --forward gre --return gre
 lab_client c1 r1
 lab_server s1 r1
@@ -250,61 +250,61 @@ for a in a1 a2; do
     lab_proxy $a
     lab_appliance_start $a
 done
-live begins
+switch_show on
 browse
 join() { # APPLIANCE
-    operate "$1" group add 51 interface eth0 router ${address[r1]} weight "${weight[$1]}" assign hash
-    operate "$1" intercept add 51 port 80 to 3129 interval 2 fall 2 rise 1
+    run_mgmtctl "$1" group add 51 interface eth0 router ${address[r1]} weight "${weight[$1]}" assign hash
+    run_mgmtctl "$1" intercept add 51 port 80 to 3129 interval 2 fall 2 rise 1
 }
-tell_step 'Here-I-Am, I-See-You: an appliance is in once it has echoed what the router sent'
+begin_step 'Here-I-Am, I-See-You: the router accepts an appliance that has echoed its receive id'
 join a2
 await 30 11 'a2 at the router' members_are 1
 await 40 17 'the first hash table' group_is "$shares == [100]"
 await 10 1 'pages from the proxy of a2' pages_are '.proxies | keys == ["a2"]'
 browse
-tell_step 'Downloads begin, through the only proxy; a1 joins'
+begin_step 'Downloads begin, through the proxy of a2; a1 joins'
 begin_downloads
 join a1
 await 30 11 'both appliances at the router' members_are 2
-tell_step 'a1 has the lowest address: it is elected, and makes the table'
+begin_step 'a1 has the lowest address: it is elected, and computes the table'
 await 40 17 'a table for both' group_is "$shares == [37, 62]"
-fact 51
+print_group 51
 await 10 1 'pages from both proxies' pages_are '.proxies | .a1 > 0 and .a2 > 0 and (has("") | not)'
 typed=('' '')
 lab_ctl r1 traffic reset >"$LAB/traffic"
 browse
 lab_ctl r1 traffic >"$LAB/traffic"
-say "  r1: $(jq -r '{"10.0.0.101": "a1", "10.0.0.102": "a2"} as $names | .appliances | (map(.flows) | add) as $all | to_entries | map("\($names[.key]) \(.value.flows) flows (\(100 * .value.flows / $all | round)%)") | join(", ")' "$LAB/traffic"); weights ${weight[a1]} and ${weight[a2]}"
+print_line "  r1: $(jq -r '{"10.0.0.101": "a1", "10.0.0.102": "a2"} as $names | .appliances | (map(.flows) | add) as $all | to_entries | map("\($names[.key]) \(.value.flows) flows (\(100 * .value.flows / $all | round)%)") | join(", ")' "$LAB/traffic"); weights ${weight[a1]} and ${weight[a2]}"
 await 40 10 'the end of the downloads' downloads_are_over
-tell_downloads
+print_downloads
 
-tell_step 'The proxy of a1 is killed: a1 gives its flows back, and they go to the server'
-lab_stop a1 proxy KILL 2>/dev/null # no word of the shell's
+begin_step 'The proxy of a1 is killed: a1 gives its flows back, and they go to the server'
+lab_stop a1 proxy KILL 2>/dev/null
 browse
 await 20 4 'the health check of a1' eval "lab_in a1 $WCCP_BIN/mgmtctl --json intercept show 51 | jq -e '[.. | .proxy? // empty] == [\"down\"]' >/dev/null"
 browse
-tell_step 'It starts again'
+begin_step 'The proxy of a1 starts again'
 lab_proxy a1
 await 20 2 'pages from both proxies' pages_are '.proxies | .a1 > 0 and .a2 > 0 and (has("") | not)'
 browse
 
-tell_step 'a1 dies without a word; the router sends it its share for 25 s more, then asks'
+begin_step 'a1 dies; the router redirects to it for 25 s more, then sends a Removal Query'
 lab_kill a1
-await 45 25 'a Removal Query of the router' asked
+await 45 25 'a Removal Query of the router' member_is_queried
 browse
-tell_step 'No answer: the router drops a1, and routes what it had'
+begin_step 'No answer: the router drops a1, and sends its flows to the server'
 await 20 5 'the end of its membership' members_are 1
 browse
-tell_step 'a2 hears of it with its next I-See-You, is elected, and makes a table'
+begin_step 'a2 learns of it by the next I-See-You, is elected, and computes a table'
 await 60 27 'the first hash table of a2' group_is ".designated and ($shares == [100])"
-fact 51
+print_group 51
 await 10 1 'all pages from a2' pages_are '.failed == 0 and (.proxies | keys == ["a2"])'
 browse
-live ends
-[ -z "$capture" ] || { lab_capture_end; chmod a+r "$capture"; say "packets: $capture"; }
-say "$survivor# mgmtctl show"
-if [ -n "$plain" ]; then exec {tell}>&1; colour=''; else colour=--colour; fi
+switch_show off
+[ -z "$capture" ] || { lab_capture_end; chmod a+r "$capture"; print_line "packets: $capture"; }
+print_line "$survivor# mgmtctl show"
+if [ -n "$plain" ]; then exec {lines_fd}>&1; colour=''; else colour=--colour; fi
 # shellcheck disable=SC2086
-lab_in $survivor "$WCCP_BIN/mgmtctl" show $colour >&"$tell" || lab_die "no picture"
-lab_end $survivor || lab_die "the appliance did not end in order"
+lab_in $survivor "$WCCP_BIN/mgmtctl" show $colour >&"$lines_fd" || lab_die "mgmtctl show failed"
+lab_end $survivor || lab_die "$survivor did not shut down cleanly"
 exit 0

@@ -1,13 +1,13 @@
 #!/bin/bash
-# memory.sh PID: the memory of a process by room, in kB: resident and locked. All memory of the daemon is locked, so
-# each mapped page counts, also one that other processes have mapped as well.
+# memory.sh PID: resident and locked memory of a process by use, in kB. wccpd locks all of its memory, therefore each
+# mapped page counts, even if it is shared with other processes.
 #
-# Rooms: the program and its libraries, with their constants and the libraries' own variables; stacks, that of the
-# main thread and those of the others, which are anonymous mappings right after a guard page; heap, also where
-# malloc took mappings of its own; shared blocks; tables, which are the program's own variables.
+# Uses: the program and its libraries, with constants and the libraries' variables; stacks (those of threads are anonymous
+# mappings after a guard page); heap, including separate mappings of malloc; shared blocks; tables, which are the program's
+# own variables.
 set -eu
 awk '
-    function room_of(name, perms, from) {
+    function use_of(name, perms, from) {
         if (name ~ /^\[heap\]/) return "heap"
         if (name ~ /^\[stack/) return "stacks"
         if (name ~ /^\[/) return "kernel pages"
@@ -21,14 +21,14 @@ awk '
     }
     /^[0-9a-f]+-[0-9a-f]+ / {
         split($1, place, "-")
-        room = room_of($6, $2, place[1])
-        last = room; end = place[2]
+        use = use_of($6, $2, place[1])
+        last = use; end = place[2]
     }
-    /^Rss:/ { kb = $2; resident[room] += kb; all += kb }
-    /^VmFlags:/ && / lo( |$)/ { locked[room] += kb; all_locked += kb }
+    /^Rss:/ { kb = $2; resident[use] += kb; all += kb }
+    /^VmFlags:/ && / lo( |$)/ { locked[use] += kb; all_locked += kb }
     END {
-        for (room in resident)
-            if (resident[room]) printf "%-22s resident %7d kB  locked %7d kB\n", room, resident[room], locked[room] | "sort"
+        for (use in resident)
+            if (resident[use]) printf "%-22s resident %7d kB  locked %7d kB\n", use, resident[use], locked[use] | "sort"
         close("sort")
         printf "%-22s resident %7d kB  locked %7d kB\n", "all", all, all_locked
     }' "/proc/$1/smaps"

@@ -1,8 +1,7 @@
 #!/bin/bash
-# stress.sh [NAME...]: the tests with threads in their long form (a minute of sending, a thousand closings and so on),
-# each under the address and under the thread sanitizer, then the whole appliance with mgmtd killed at a hundred random
-# moments, under the address sanitizer: all of them or those named. What fails keeps its log in build/stress/; ends
-# with 1 when one did.
+# stress.sh [NAME...]: runs the tests with threads in their long form, each with the address and with the thread sanitizer,
+# and scenario_daemon, which then kills mgmtd a hundred times, with the address sanitizer. NAME: only these. Logs are in
+# build/stress/. Exits with 1 if a test fails.
 set -u
 cd "$(dirname "$0")/.." || exit 1
 mkdir -p build/stress
@@ -12,7 +11,7 @@ names=("$@")
 done
 status=0
 
-run() { # NAME PRESET COMMAND...
+run_stressed() { # NAME PRESET COMMAND...
     local name=$1 preset=$2 start=$SECONDS
     local log=build/stress/$name.$preset.log; shift 2
     if WCCP_STRESS=1 TSAN_OPTIONS="detect_deadlocks=1 second_deadlock_stack=1" timeout 900 "$@" >"$log" 2>&1; then
@@ -36,11 +35,11 @@ for preset in asan tsan; do
     [ ${#targets[@]} -gt 0 ] || continue
     { cmake --preset $preset && cmake --build --preset $preset -j "$(nproc)" --target "${targets[@]}"; } \
         >build/stress/$preset.log 2>&1 || { tail -n 40 build/stress/$preset.log; exit 1; }
-    # The thread sanitizer wants its usual places in memory.
+    # The thread sanitizer does not work with every address space layout.
     with=(); [ $preset = asan ] || with=(setarch -R)
     for name in "${targets[@]}"; do
-        [[ $name != *_test ]] || run "$name" $preset "${with[@]}" lab/in-appliance "build/$preset/bin/$name"
+        [[ $name != *_test ]] || run_stressed "$name" $preset "${with[@]}" lab/in-appliance "build/$preset/bin/$name"
     done
-    for name in "${scenarios[@]}"; do run "$name" $preset "tests/$name.sh" "$PWD/build/$preset/bin"; done
+    for name in "${scenarios[@]}"; do run_stressed "$name" $preset "tests/$name.sh" "$PWD/build/$preset/bin"; done
 done
 exit $status
