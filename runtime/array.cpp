@@ -1,9 +1,15 @@
-// The generic array. All elements lie in one block of slots; whoever owns the array guards it.
+// The generic array: all elements are in one block of slots.
 //
-// `sorted` says that the elements are known to be in order. Appending and inserting keep it where the
-// neighbours agree, so that an array filled in order is searched by halves; set, and a null left in a place,
-// give it up. A large array that is not in order, and whose family gives a hash, answers array_best_search
-// from an index (array_index.cpp), or a start with ten thousand bindings would be quadratic.
+// `sorted` means that the elements are known to be in order. An insertion keeps it if the new element fits
+// between its neighbours, so that an array which is filled in order can be searched by bisection; array_set
+// and the _no_shift operations clear it. A large unsorted array whose options have a hash function is
+// searched through a hash index (array_index.cpp): a start of wccpd with ten thousand bindings would
+// otherwise take quadratic time.
+//
+// The index holds positions. Every operation that moves, replaces or removes elements drops it, before it
+// changes anything; appending needs not, since the index adds what it hasn't seen at the next search.
+//
+// The copying operations, and those that apply a policy, are written in terms of the _takeover operations.
 #include "runtime/array.h"
 
 #include <algorithm>
@@ -33,7 +39,7 @@ lc_status array_std_takeover_func(void **inout_element, void **out_slot) {
 }
 static void free_nothing(void *) {}
 
-// ---- Options and life
+// --- Options and life
 
 lc_status array_options_get_defaults(array_options *out) {
     CHECK_NULL(out);
@@ -56,6 +62,7 @@ lc_status array_options_get(const array *list, array_options *out) {
 lc_status array_options_set(array *list, const array_options *options) {
     CHECK_NULL(list);
     CHECK_NULL(options);
+    // Another order: what was sorted may not be.
     if (options->compare != list->compare && list->length > 1)
         list->sorted = 0;
     list->initial_size = std::max(options->initial_size, 1u);
@@ -154,7 +161,7 @@ static lc_status make_room(array *list, uint64_t length) {
     return LC_OK;
 }
 
-// ---- Reading
+// --- Reading
 
 lc_status array_length(const array *list, uint32_t *out_length) {
     CHECK_NULL(out_length);
@@ -179,7 +186,7 @@ lc_status array_peek(const array *list, void **out_element) {
     return list->length ? array_get(list, list->length - 1, out_element) : LC_NOT_FOUND;
 }
 
-// ---- Placing
+// --- Placing
 
 static lc_status copy_of(const array *list, const void *element, void **out) {
     *out = nullptr;
@@ -190,7 +197,7 @@ static lc_status copy_of(const array *list, const void *element, void **out) {
     return LC_OK;
 }
 
-// Runs a takeover operation with a copy of the element.
+// Runs a _takeover operation with a copy of the element, and frees the copy if the operation didn't take it.
 template <typename Operation>
 static lc_status with_copy(array *list, const void *element, Operation operation) {
     CHECK_NULL(list);
@@ -201,7 +208,8 @@ static lc_status with_copy(array *list, const void *element, Operation operation
     return status;
 }
 
-// An element has come to `index`: are the neighbours still in order?
+// Clears `sorted` if the new element at `index` is out of order with its neighbours. An array of one element
+// is sorted; nulls never are.
 static void note_order(array *list, uint32_t index) {
     if (!list->sorted)
         return;
@@ -221,6 +229,7 @@ lc_status array_set_takeover(array *list, uint32_t index, void **inout_element) 
     list->sorted = 0;
     void *old = list->elements[index];
     if (old == *inout_element) {
+        // The caller passes the element that is there already: freeing "the old one" would free it.
         *inout_element = nullptr;
         return LC_OK;
     }
@@ -235,7 +244,7 @@ lc_status array_set(array *list, uint32_t index, const void *element) {
 lc_status array_insert_takeover(array *list, uint32_t index, void **inout_element) {
     CHECK_NULL(list);
     CHECK_NULL(inout_element);
-    if (index > list->length) // beyond the end there is nothing to move up
+    if (index > list->length) // nothing to move up; array_set fills the gap with nulls
         return array_set_takeover(list, index, inout_element);
     CHECK_STATUS(make_room(list, uint64_t{list->length} + 1));
     if (index < list->length)
@@ -249,7 +258,8 @@ lc_status array_insert_takeover(array *list, uint32_t index, void **inout_elemen
     return LC_OK;
 }
 
-// What the policy says of a new element that equals the one at `index`.
+// Applies the policy to a new element that equals the one at `index`. `out_done`: the new one isn't to be
+// inserted.
 static lc_status meet_equal(array *list, uint32_t index, void **inout_element, bool *out_done) {
     *out_done = true;
     if (list->duplicate_policy == array_dup_refuse)
@@ -293,6 +303,8 @@ lc_status array_find_insertion_point_hint(const array *list, const void *element
     *out_index = 0;
     CHECK_NULL(list);
     CHECK_CONDITION(list->compare);
+    // A linear scan gives a defined result for an unsorted array as well, which the options may allow. Sorted
+    // insertion is used for short arrays only.
     while (*out_index < list->length && list->compare(&list->elements[*out_index], &element) <= 0)
         ++*out_index;
     return LC_OK;
@@ -304,6 +316,7 @@ lc_status array_insert_sorted_hint_takeover(array *list, void **inout_element, u
     uint32_t index = 0;
     CHECK_STATUS(make_room(list, uint64_t{list->length} + 1));
     CHECK_STATUS(array_find_insertion_point_hint(list, *inout_element, hint, &index));
+    // Equal elements are just before the insertion point.
     if (index > 0 && list->duplicate_policy != array_dup_allow &&
         list->compare(&list->elements[index - 1], inout_element) == 0) {
         bool done = false;
@@ -326,7 +339,7 @@ lc_status array_insert_sorted(array *list, const void *element) {
     return array_insert_sorted_hint(list, element, 0);
 }
 
-// ---- Taking out
+// --- Taking out
 
 lc_status array_remove_no_shift(array *list, uint32_t index, void **out_element) {
     CHECK_NULL(out_element);
@@ -363,7 +376,7 @@ lc_status array_pop(array *list, void **out_element) {
     return list->length ? array_remove(list, list->length - 1, out_element) : LC_NOT_FOUND;
 }
 
-// ---- Order and search
+// --- Order and search
 
 lc_status array_sort(array *list) {
     CHECK_NULL(list);
@@ -387,7 +400,8 @@ lc_status array_binary_search(const array *list, const void *key, uint32_t *out_
     CHECK_NULL(list);
     CHECK_CONDITION(list->sorted || !list->require_sorted);
     CHECK_CONDITION(list->compare);
-    uint32_t low = 0, high = list->length; // the first that is not below the key
+    // Finds the first element that is not less than the key, and therefore the first of several equal ones.
+    uint32_t low = 0, high = list->length;
     while (low < high) {
         const uint32_t middle = low + (high - low) / 2;
         if (list->compare(&list->elements[middle], &key) < 0)
@@ -419,7 +433,7 @@ lc_status array_best_search(const array *list, const void *key, uint32_t *out_in
     return found ? told(index, out_index) : LC_NOT_FOUND;
 }
 
-// ---- Whole arrays
+// --- Whole arrays
 
 lc_status array_duplicate(const array *list, array **out) {
     CHECK_NULL(out);
@@ -430,6 +444,7 @@ lc_status array_duplicate(const array *list, array **out) {
     array *copy = nullptr;
     CHECK_STATUS(array_new(&copy, &options));
     lc_status status = make_room(copy, list->length);
+    // The copy's length grows with each element, so that array_free frees exactly those that were copied.
     for (uint32_t i = 0; i < list->length && status == LC_OK; i++) {
         status = copy_of(list, list->elements[i], &copy->elements[i]);
         if (status == LC_OK)
@@ -448,6 +463,7 @@ lc_status array_concat(array *list, array *moved) {
     CHECK_CONDITION(list != moved);
     const uint64_t length = uint64_t{list->length} + moved->length;
     CHECK_STATUS(make_room(list, length));
+    // Cannot fail from here on, so that no element is in both arrays or in neither.
     array_index_drop(moved);
     for (uint32_t i = 0; i < moved->length; i++) {
         list->elements[list->length++] = moved->elements[i];
@@ -485,7 +501,7 @@ static lc_status walk(array *list, array_foreach_function function, void *data, 
                 return LC_ASSERTION;
             }
             CHECK_STATUS(array_delete(list, i));
-            continue;
+            continue; // the next element is at the same index now
         case LC_FOREACH_HALT_ERROR:
             LC_LOG(LC_LOG_ERR, "Array element %d halted iteration with an error", static_cast<int32_t>(i));
             return LC_GENERIC;

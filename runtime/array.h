@@ -1,8 +1,12 @@
-// The one sequence of the management code: word-sized elements with functions that compare, copy and free
-// them, and a policy for duplicates. The typed arrays of typed_arrays.h are covers over it.
+// The generic array of the management code: word-sized elements, functions that compare, copy and free them,
+// and a policy for duplicates. Most code uses it through the typed arrays of typed_arrays.h.
 //
-// An array knows whether its elements are in order: appending keeps that as long as the new element doesn't
-// sort before the last, array_set gives it up, array_sort brings it back.
+// An array owns its elements, which its free function frees. It tracks whether they are sorted: appending
+// keeps an array sorted if the new element belongs at the end; array_set makes it unsorted; array_sort sorts
+// it again.
+//
+// All operations return LC_NULL for a null array. Nothing is locked: an array is used under the lock of its
+// owner.
 #pragma once
 
 #include <atomic>
@@ -10,30 +14,33 @@
 
 #include "runtime/common.h"
 
-using array_compare_function = int (*)(const void *a, const void *b); // pointers to the two slots
+// Takes pointers to the two slots, as qsort does. Less than, equal to or greater than 0.
+using array_compare_function = int (*)(const void *a, const void *b);
 using array_duplicate_function = lc_status (*)(const void *element, void **out_copy);
 using array_takeover_function = lc_status (*)(void **inout_element, void **out_slot);
 using array_free_function = void (*)(void *element);
 using array_hash_function = uint32_t (*)(const void *element);
 
+// What happens to a new element that equals one in the array.
 enum : uint32_t {
-    array_dup_allow = 1,
-    array_dup_replace = 2, // the old one is deleted
-    array_dup_drop = 3,    // the new one is freed, result 0
-    array_dup_refuse = 4,  // LC_EXISTS
+    array_dup_allow = 1,   // both stay
+    array_dup_replace = 2, // the old one is freed
+    array_dup_drop = 3,    // the new one is freed, with result 0
+    array_dup_refuse = 4,  // LC_EXISTS; the new one stays the caller's
 };
-constexpr uint32_t array_size_max = 0x7ffffffe;
+constexpr uint32_t array_size_max = 0x7ffffffe; // elements
 
 struct array_options {
-    uint32_t initial_size;
+    uint32_t initial_size; // slots
     array_compare_function compare;
     array_duplicate_function duplicate; // null: elements can't be copied
     array_takeover_function takeover;
     array_free_function free;
-    uint32_t duplicate_policy;
-    uint32_t require_sorted;
-    // Optional: a hash of what `compare` calls equal. array_best_search then answers on a large array that is
-    // not sorted from an index that it keeps. `key_changes` counts changes of keys inside elements.
+    uint32_t duplicate_policy; // array_dup_...
+    uint32_t require_sorted;   // binary search and sorted insertion refuse an unsorted array
+    // Optional: a hash function that gives elements which compare equal the same value. array_best_search
+    // then keeps a hash index of a large unsorted array. `key_changes`, optional as well, is increased
+    // whenever the key of an element that may be in an array changes; it invalidates the index.
     array_hash_function hash;
     const std::atomic<uint32_t> *key_changes;
 };
@@ -53,8 +60,8 @@ struct array {
     array_free_function free;
     array_hash_function hash;
     const std::atomic<uint32_t> *key_changes;
-    mutable array_index *index; // null until a search needs it (array_index.h)
-    uint8_t placed_record;      // lies in memory that isn't the array's own, see array_place
+    mutable array_index *index; // null until a search builds it (array_index.h)
+    uint8_t placed_record;      // the record is in memory of somebody else, see array_place
     uint8_t placed_elements;
 };
 
@@ -66,11 +73,12 @@ lc_status array_std_assign_func(const void *element, void **out_copy);
 lc_status array_std_takeover_func(void **inout_element, void **out_slot);
 
 lc_status array_new(array **out, const array_options *options);
-// Makes an array of `count` slots, at least one, in memory that belongs to something else and has to outlive
-// the array. All operations work: an array that has to grow gets slots of its own, and freeing it frees those
-// only. The slots are filled by the caller.
+// Initialises an array of `count` slots (at least one, filled by the caller) in memory that the caller owns
+// and that must outlive the array. All operations work on it: if it has to grow, it allocates slots of its
+// own, and array_free frees only those.
 void array_place(array *record, const array_options *options, void **elements, uint32_t count);
 lc_status array_free(array **inout);
+// Frees all elements and shrinks to the initial size.
 lc_status array_empty(array *list);
 lc_status array_length(const array *list, uint32_t *out_length);
 inline uint32_t array_length_quick(const array *list) {
@@ -81,7 +89,10 @@ inline void *array_get_quick(const array *list, uint32_t index) {
     return list && index < list->length ? list->elements[index] : nullptr;
 }
 
-// The _takeover forms clear the caller's variable when they succeed, and when a policy drops the element.
+// The forms without _takeover store a copy made by the duplicate function; without one, LC_ASSERTION. The
+// _takeover forms store the caller's element and set the caller's variable to null; on failure the element
+// stays the caller's. array_set extends the array with nulls up to `index`. The sorted forms need a sorted
+// array (LC_ASSERTION otherwise, if the options require it). The hint is ignored.
 lc_status array_set(array *list, uint32_t index, const void *element);
 lc_status array_set_takeover(array *list, uint32_t index, void **inout_element);
 lc_status array_append(array *list, const void *element);
@@ -96,6 +107,7 @@ lc_status array_insert_sorted_hint_takeover(array *list, void **inout_element, u
 lc_status array_find_insertion_point_hint(const array *list, const void *element, uint32_t hint,
                                           uint32_t *out_index);
 
+// Remove gives the element to the caller, delete frees it. The _no_shift forms leave a null in its place.
 lc_status array_remove(array *list, uint32_t index, void **out_element);
 lc_status array_remove_no_shift(array *list, uint32_t index, void **out_element);
 lc_status array_delete(array *list, uint32_t index);
@@ -104,17 +116,21 @@ lc_status array_pop(array *list, void **out_element);
 lc_status array_peek(const array *list, void **out_element);
 
 lc_status array_sort(array *list);
-// `key` is an element to compare with; `out_index` may be null. LC_NOT_FOUND for no match.
+// `key` is an element that the others are compared with; `out_index` may be null. LC_NOT_FOUND if there is no
+// match. Of several matches the binary and the linear search find the first. The best search uses the binary
+// search on a sorted array, otherwise the hash index if there is one, otherwise the linear search.
 lc_status array_binary_search(const array *list, const void *key, uint32_t *out_index);
 lc_status array_linear_search(const array *list, const void *key, uint32_t start, uint32_t *out_index);
 lc_status array_best_search(const array *list, const void *key, uint32_t *out_index);
 
 lc_status array_duplicate(const array *list, array **out);
-lc_status array_concat(array *list, array *moved); // `moved` is empty afterwards
-int array_equal(const array *a, const array *b);
+lc_status array_concat(array *list, array *moved); // moves all elements to the end of `list`
+int array_equal(const array *a, const array *b);   // 1 or 0
 
-// LC_FOREACH_DELETE, _HALT_ERROR and _HALT_OK from the function steer the walk; other failures are counted as
-// one at the end and do not stop it.
+// Calls the function for each element by index. Its result decides what follows: LC_FOREACH_DELETE deletes
+// the element (array_foreach_delete only), LC_FOREACH_HALT_ERROR ends the walk with LC_GENERIC,
+// LC_FOREACH_HALT_OK and LC_CANCELLED end it with 0. After any other failure the walk continues, and its
+// result is LC_GENERIC.
 using array_foreach_function = lc_status (*)(array *list, uint32_t index, void *element, void *data);
 lc_status array_foreach(array *list, array_foreach_function function, void *data);
 lc_status array_foreach_delete(array *list, array_foreach_function function, void *data);

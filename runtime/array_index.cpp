@@ -2,10 +2,12 @@
 
 #include <cstdlib>
 
-// Open addressing; a slot holds a position + 1, 0 for none. The table is at least twice the entries.
+// Open addressing with linear probing. A slot holds a position plus 1, or 0 when it is free. There are always
+// at least twice as many slots as elements, so a probe ends. Nothing is ever removed: a change that would
+// need it drops the whole index.
 struct array_index {
     uint32_t slot_count; // a power of two
-    uint32_t indexed;    // the first so many elements stand in it
+    uint32_t indexed;    // so many elements from the start have been entered
     uint32_t key_changes;
     uint32_t slots[];
 };
@@ -21,7 +23,7 @@ void array_index_drop(const array *list) {
     list->index = nullptr;
 }
 
-// The slot of an equal element, or the free one where it would go.
+// The slot of an equal element, or else the free slot where the key belongs.
 static uint32_t *slot_of(const array *list, const void *key) {
     const uint32_t mask = list->index->slot_count - 1;
     uint32_t at = list->hash(key) & mask;
@@ -50,6 +52,7 @@ static bool make_index(const array *list) {
 }
 
 static bool bring_up_to_date(const array *list) {
+    // A key that has changed inside an element makes its entry wrong, and so does an array that got shorter.
     if (list->index &&
         (list->index->key_changes != changes_now(list) || list->index->indexed > list->length ||
          2 * uint64_t{list->length} > list->index->slot_count))
@@ -61,6 +64,7 @@ static bool bring_up_to_date(const array *list) {
         if (!list->elements[position])
             continue;
         uint32_t *slot = slot_of(list, list->elements[position]);
+        // The first of several equal elements keeps the slot, as a search from the start would find it.
         if (!*slot)
             *slot = position + 1;
     }

@@ -1,5 +1,6 @@
-// A hash from what an array's compare function calls equal to the first place of it. An array that is not
-// sorted keeps one from its first larger search on; appending adds to it, every other change drops it.
+// The hash index of an unsorted array: from a key to the first position of an equal element. It is built by
+// the first array_best_search on an array of at least 16 elements. Appended elements are added at the next
+// search; every other change drops it.
 #pragma once
 
 #include <cstdint>
@@ -7,5 +8,7 @@
 #include "runtime/array.h"
 
 void array_index_drop(const array *list);
-// False when the array has no use for an index or no memory is left for it: search in another way.
+// False when the array is too short for an index, has no hash function, or memory has run out: the caller
+// searches the array instead. Otherwise `out_found` says whether there is an equal element, and
+// `out_position` where the first is.
 bool array_index_find(const array *list, const void *key, uint32_t *out_position, bool *out_found);

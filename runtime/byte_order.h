@@ -1,6 +1,7 @@
-// Wire order as a type. A be16 or be32 holds its bytes as they stand on the wire, on any address: it can be
-// copied and compared for equality, and nothing else happens to it without to_host() or to_be(). A wire
-// layout built of these has alignment 1, so a pointer into a packet may be read through at odd places.
+// Network byte order as a type. A be16 or be32 holds its bytes in the order in which they are sent. It can be
+// copied and compared for equality; for anything else it has to be converted with to_host(), and back with
+// to_be16() or to_be32(). The alignment is 1, and so is that of a layout made of these: it can be read at any
+// offset of a packet.
 #pragma once
 
 #include <bit>
@@ -28,8 +29,9 @@ constexpr be32 to_be32(uint32_t host) {
              static_cast<uint8_t>((host >> 8) & 0xff), static_cast<uint8_t>(host & 0xff)}};
 }
 
-// The four bytes read as a native word, as they lie in memory: for sockets, for equality and for the few
-// places whose order is defined on this word. It is no number.
+// The four bytes as one machine word, without a conversion: for in_addr and for the few places that are
+// defined to order addresses by this word. Its value depends on the machine; it is not the number that the
+// bytes represent.
 constexpr uint32_t raw_word(be32 wire) {
     return std::bit_cast<uint32_t>(wire);
 }

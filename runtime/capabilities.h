@@ -1,7 +1,7 @@
-// What the kernel lets this process do.
+// Capabilities of the process (capabilities(7)).
 #pragma once
 
 #include <linux/capability.h>
 
-// Whether the process has the capability, CAP_NET_ADMIN for example, in effect.
+// Whether a capability, CAP_NET_ADMIN for example, is in the effective set.
 bool lc_has_capability(int capability);

@@ -1,17 +1,18 @@
-// Named blocks of System V shared memory, found by all processes of the appliance through one registry
-// segment.
+// Named blocks of System V shared memory and their registry.
 //
-// The registry is a format: 2000 block records, 400 entries of "mem.conf" and a state word, which the first
-// process swaps from empty to loading and sets to ready, or back to empty when it could not read the file.
-// Only a registry that cannot be attached stops the process.
+// The registry is a segment that also other programs of the platform use, so its layout is fixed: 2000 block
+// records, 400 entries of "mem.conf" and a state word. The first process changes the state from empty to
+// loading by compare-and-swap, loads the file and sets it to ready, or back to empty if the file couldn't be
+// read; other processes wait for it. A registry that can't be attached ends the process; every other failure
+// is logged and returned.
 //
-// Which process creates a block is decided under a semaphore that has the registry's key. It is 0 while
-// nobody holds it, and the kernel takes back what a holder that dies has added. A free record is claimed by
-// compare-and-swap all the same: the format has programs that know no semaphore.
+// A System V semaphore with the registry's key serialises the creation of blocks. It is 0 while it is free;
+// SEM_UNDO makes the kernel release it if its holder dies. A free record is claimed by compare-and-swap all
+// the same, because the platform's other programs don't use the semaphore.
 //
-// A key may belong to a segment that someone else has created, of another size: its size is checked before a
-// byte of it is used. A block that is too short is refused like one that cannot be attached; a registry that
-// is too short, or whose state word has no meaning, counts as one that cannot be attached.
+// A key may belong to a segment of another size that somebody else has created. Its size is therefore checked
+// before a byte of it is used. A segment that is too short for its block, or for the registry, is treated as
+// one that can't be attached, and so is a registry with an unknown state.
 #include "runtime/cmem.h"
 
 #include <atomic>
@@ -40,7 +41,7 @@ constexpr size_t CONF_LINE_BYTES = 256;
 constexpr uint64_t NORMAL_PAGE = 4096;
 constexpr uint64_t HUGE_PAGE_BYTES = 0x200000;
 constexpr int SHARED_MODE = 0777;
-constexpr unsigned WAIT_SECONDS = 5; // for another process that loads the registry or creates a block
+constexpr unsigned WAIT_SECONDS = 5; // for another process that is loading the registry or creating a block
 enum : int32_t { NODE_LOCAL = -2, NODE_INTERLEAVED = -1 };
 enum : uint32_t { REGISTRY_EMPTY = 0, REGISTRY_LOADING = 0xFFFFFFFF, REGISTRY_READY = 1 };
 
@@ -52,13 +53,13 @@ struct cmem_block {
     int32_t node;
     uint32_t key;
     uint64_t zero;
-    uint64_t attach_address; // requested, 0 for any
+    uint64_t attach_address; // requested by mem.conf, 0 for any
     uint64_t creator_address;
-    std::atomic<int32_t> pid;
+    std::atomic<int32_t> pid; // of the creator
     uint32_t alignment;
     uint64_t counters[4];
     uint32_t diagnostic;
-    uint32_t configured;
+    uint32_t configured; // 1: mem.conf has an entry for it
     std::atomic<uint32_t> in_use;
     uint32_t tail;
 };
@@ -91,9 +92,10 @@ static_assert(offsetof(cmem_registry, conf) == 336000 && offsetof(cmem_registry,
 static_assert(sizeof(cmem_registry) == 361608);
 
 static cmem_registry *registry;
-static bool created_here[MAX_BLOCKS]; // by this process or the one that it was forked from
+static bool created_here[MAX_BLOCKS]; // by this process, or by the one from which it was forked
 static pthread_mutex_t registry_lock = PTHREAD_MUTEX_INITIALIZER;
 
+// To a multiple of `page`, without overflow.
 static uint64_t round_up(uint64_t length, uint64_t page) {
     return length > UINT64_MAX - page ? UINT64_MAX / page * page : (length + page - 1) / page * page;
 }
@@ -126,7 +128,7 @@ static bool parse_page_size(const char *word, uint64_t *out) {
     return true;
 }
 
-// The next word of a line, cut off with a NUL; the empty one at the end of the line.
+// The next word of a line, which is ended with a NUL in place; an empty word at the end of the line.
 static char *next_word(char **inout_text) {
     char *word = *inout_text + strspn(*inout_text, " \t");
     char *end = word + strcspn(word, " \t");
@@ -135,7 +137,7 @@ static char *next_word(char **inout_text) {
     return word;
 }
 
-// A hexadecimal number of at most `limit`, else 0: no key, and no address.
+// A hexadecimal number of at most `limit`; 0, which means no key and no address, for anything else.
 static uint64_t parse_hex(const char *word, uint64_t limit) {
     char *end = nullptr;
     errno = 0;
@@ -143,7 +145,8 @@ static uint64_t parse_hex(const char *word, uint64_t limit) {
     return errno == 0 && *end == '\0' && word[0] != '-' && number <= limit ? number : 0;
 }
 
-// False for a line that is passed over; `out_wrong` is what is wrong with it, or null for a comment.
+// False for a line that is ignored; `out_wrong` says what is wrong with it, null for a comment or an empty
+// line.
 static bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) {
     *out_wrong = nullptr;
     const char *name = next_word(&line);
@@ -159,19 +162,19 @@ static bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) 
         return false;
     out->key = static_cast<uint32_t>(parse_hex(next_word(&line), UINT32_MAX));
     if (out->key == static_cast<uint32_t>(CMEM_REGISTRY_KEY))
-        out->key = 0; // a block there would wipe out the registry
+        out->key = 0; // creating the block would zero the registry
     out->attach_address = parse_hex(next_word(&line), UINT64_MAX);
     return true;
 }
 
-// Calls take(entry) for each good line until it gives false, and fail(what is wrong, line, its number) for
-// the others. 0, or the errno of a file that cannot be read.
+// Calls take(entry) for each valid line until that returns false, and fail(what is wrong, line, line number)
+// for each invalid one. Returns 0, or the errno if the file can't be read.
 template <typename Take, typename Fail>
 static int read_conf(const char *path, const Take &take, const Fail &fail) {
     FILE *file = fopen(path, "re");
     char line[CONF_LINE_BYTES], whole[CONF_LINE_BYTES];
     cmem_conf entry;
-    bool inside = false; // of a line longer than the buffer: the rest of it is passed over
+    bool inside = false; // a line that is longer than the buffer: its rest is skipped
     bool more = true;
     for (uint32_t number = 0; file && more && fgets(line, sizeof line, file);) {
         const bool rest = inside;
@@ -182,7 +185,7 @@ static int read_conf(const char *path, const Take &take, const Fail &fail) {
         if (rest)
             continue;
         number++;
-        strlcpy(whole, line, sizeof whole);
+        strlcpy(whole, line, sizeof whole); // parsing cuts the line into words
         const char *wrong = nullptr;
         if (parse_conf_line(line, &entry, &wrong))
             more = take(entry);
@@ -195,8 +198,8 @@ static int read_conf(const char *path, const Take &take, const Fail &fail) {
     return error;
 }
 
-// Fills the entries of a registry that this process is loading. False, with a line, when the file cannot be
-// read; the entries are then empty.
+// Loads mem.conf into a registry whose state is loading. False, logged, if the file can't be read; no entry
+// is then set.
 static bool load_conf(cmem_registry *fresh) {
     uint32_t count = 0;
     const int error = read_conf(
@@ -217,7 +220,7 @@ static bool load_conf(cmem_registry *fresh) {
 
 cmem_conf_faults cmem_check_conf(const char *path, const char *name) {
     cmem_conf_faults faults = {};
-    bool found = false; // the first entry of a name counts
+    bool found = false; // the first entry with the name counts, as in find_conf
     uint32_t count = 0;
     faults.error = read_conf(
         path,
@@ -237,7 +240,7 @@ cmem_conf_faults cmem_check_conf(const char *path, const char *name) {
 
 // --- The registry
 
-// The bytes of a segment that can be used: its last page is there as a whole. 0 when it cannot be asked.
+// The usable bytes of a segment, which consists of whole pages; 0 if it can't be queried.
 static uint64_t segment_bytes(int id) {
     shmid_ds status = {};
     return shmctl(id, IPC_STAT, &status) == 0 ? round_up(status.shm_segsz, NORMAL_PAGE) : 0;
@@ -248,8 +251,8 @@ static uint64_t segment_bytes(int id) {
     abort();
 }
 
-// Sees to it that the configuration is in the registry: loads it, or waits for the process that does. False,
-// with a line, when that process does not finish. A file that cannot be read is left to the next process.
+// Loads the configuration into the registry, or waits for the process that is loading it. False, logged, if
+// that process doesn't finish. If this process can't read the file, the next one tries again.
 static bool fill_registry(cmem_registry *fresh) {
     for (unsigned waited = 0;; waited++) {
         uint32_t state = REGISTRY_EMPTY;
@@ -279,7 +282,7 @@ static cmem_registry *attach_registry() {
     const mutex_guard guard(&registry_lock);
     if (registry)
         return registry;
-    // Another's segment that is shorter gives EINVAL here.
+    // A segment that exists already and is too short gives EINVAL.
     const int id = shmget(CMEM_REGISTRY_KEY, sizeof(cmem_registry), IPC_CREAT | SHARED_MODE);
     void *memory = id >= 0 ? shmat(id, nullptr, 0) : reinterpret_cast<void *>(-1);
     if (memory == reinterpret_cast<void *>(-1))
@@ -318,7 +321,7 @@ static void free_block(cmem_block *block) {
     block->in_use = 0;
 }
 
-// A process that has ended and was not waited for yet. It still has its files in /proc.
+// Whether the process has ended but has not been waited for. Its files in /proc still exist.
 static bool is_zombie(int32_t pid) {
     char path[64], text[256] = {};
     snprintf(path, sizeof path, "/proc/%d/stat", pid);
@@ -327,12 +330,14 @@ static bool is_zombie(int32_t pid) {
         return false;
     const ssize_t length = read(fd, text, sizeof text - 1);
     close(fd);
+    // "pid (name) state ...", and the name may itself contain a parenthesis.
     const char *name_end = length > 0 ? strrchr(text, ')') : nullptr;
     return name_end && (strncmp(name_end, ") Z", 3) == 0 || strncmp(name_end, ") X", 3) == 0);
 }
 
-// By the creator's numa_maps; where the kernel has none at all, by its process id. A record with our own id
-// that we did not create is of an earlier process that had the same one.
+// Whether the creator of a block is still running. A process exists if it has a numa_maps file, or on a
+// kernel without those, if it can be signalled. A record with our own process id which we didn't create is
+// from an earlier process that had the same id.
 static bool creator_lives(const cmem_registry *known, const cmem_block *block) {
     const int32_t pid = block->pid;
     if (pid == getpid())
@@ -354,7 +359,7 @@ static const cmem_conf *find_conf(const cmem_registry *known, const char *name) 
     return nullptr;
 }
 
-// Fills a claimed record. The name, by which others find it, comes last.
+// Fills a record that this process has claimed.
 static void reset_block(cmem_block *block, const cmem_registry *known, const char *name, uint64_t length) {
     static const cmem_conf unlisted = {{}, NORMAL_PAGE, 0, NODE_LOCAL, 0, 0};
     const cmem_conf *entry = find_conf(known, name);
@@ -372,11 +377,14 @@ static void reset_block(cmem_block *block, const cmem_registry *known, const cha
     memset(block->counters, 0, sizeof block->counters);
     block->diagnostic = 0;
     strlcpy(block->owner, program_invocation_short_name, sizeof block->owner);
+    // The name is written last, and its first byte after the others: a process that finds the name, without
+    // any lock, finds the record complete.
     strlcpy(block->name + 1, name + 1, sizeof block->name - 1);
     __atomic_store_n(&block->name[0], name[0], __ATOMIC_RELEASE);
 }
 
-// The record to use for a name: a new one, or the one of a creator that has gone.
+// The record for a name, either a free one or that of a creator that has ended; null, logged, if there is
+// none.
 static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t length) {
     cmem_block *block = find_block(known, name);
     if (!block) {
@@ -402,11 +410,12 @@ static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t l
 
 namespace {
 
-// Held by the one process that looks for a name and takes its record.
+// The semaphore, from the search for a name until its record is filled.
 struct creation_lock {
     creation_lock() : id(semget(CMEM_REGISTRY_KEY, 1, IPC_CREAT | SHARED_MODE)) {
         sembuf take[] = {{.sem_num = 0, .sem_op = 0, .sem_flg = 0},
                          {.sem_num = 0, .sem_op = 1, .sem_flg = SEM_UNDO}};
+        // Both steps are one atomic operation: wait for 0, and add 1.
         const timespec limit = {WAIT_SECONDS, 0};
         int result;
         do
@@ -427,7 +436,7 @@ struct creation_lock {
 
 } // namespace
 
-// The filled record of a block that this process may create; null, with a line, when it may not.
+// The filled record of a block that this process may create; null, logged, if it may not.
 static cmem_block *claim_name(cmem_registry *known, const char *name, uint64_t length) {
     const creation_lock lock;
     if (!lock.held) {
@@ -510,6 +519,7 @@ void *cmem_create_block(uint64_t length, const char *name) {
     block->creator_address = reinterpret_cast<uint64_t>(memory);
     if (fresh)
         place_on_node(memory, block);
+    // A new segment is zero already; one that outlived its creator isn't.
     memset(memory, 0, block->length);
     return memory;
 }
@@ -551,6 +561,7 @@ void *cmem_attach_block(const char *name, uint64_t *out_length) {
     }
     int id = shmget(static_cast<int>(block->key), 0, 0);
     const uint64_t held = id >= 0 ? segment_bytes(id) : 0;
+    // A segment shorter than its record says has been replaced by somebody else.
     if (id >= 0 && (held == 0 || held < block->length)) {
         errno = EINVAL;
         id = -1;

@@ -1,10 +1,13 @@
-// Status words, the four failure checks, enumeration tables, bounded and allocated strings, and the
-// owner-tracking lock.
+// The table of status descriptions, what the CHECK_ macros log, enumeration tables, bounded and allocated
+// strings, the environment, and the lock that tracks its owner.
 //
-// A check logs with the function, file and line of the place that made it, then calls an empty exported
-// function: a place for a debugger to stop. LC_CANCELLED is the one failure that travels without a line. A
-// lock releases itself when its owner ends while holding it, through a thread-specific key; so a cancelled
-// thread never takes one along.
+// Everything else in the system is built on this file; of the rest of the system it calls only the log, and
+// the log calls back into it: into the locks, the tables and strlcpy. Nothing here may therefore log while it
+// holds a lock that the log takes (lc_env_lock, see env_guard).
+//
+// A cancelled thread normally releases its locks when its stack is unwound, by lc_lock_guard. For a thread
+// that ends while it holds a lock without a guard, each lock has a thread-specific key whose destructor
+// releases it.
 #include "runtime/common.h"
 
 #include <pthread.h>
@@ -65,7 +68,7 @@ const lc_enum_entry lc_status_table[] = {
 
 // --- The failure checks
 
-// Kept out of line and never empty to the optimiser, so that a breakpoint holds.
+// The empty asm keeps the optimiser from removing the calls, which a breakpoint needs.
 __attribute__((noinline)) void bail_debug() {
     asm volatile("");
 }
@@ -229,7 +232,7 @@ extern "C" size_t strlcat(char *dst, const char *src, size_t size) noexcept {
 
 constexpr size_t FIRST_FORMAT_BYTES = 100;
 
-// The one routine under all four: formats once into a first buffer, and again when the result needs more.
+// Formats into 100 bytes, and if that was too short once more into exactly as many as it takes.
 static lc_status format_new(char **out_string, uint32_t *out_length, const char *format, va_list arguments) {
     *out_string = nullptr;
     if (out_length)
@@ -238,6 +241,7 @@ static lc_status format_new(char **out_string, uint32_t *out_length, const char 
     owned_text text(static_cast<char *>(malloc(FIRST_FORMAT_BYTES)));
     CHECK_NULL(text.pointer);
     va_list again;
+    // A va_list can be used only once; the second pass needs its own copy.
     va_copy(again, arguments);
     const int first = vsnprintf(text.pointer, FIRST_FORMAT_BYTES, format, arguments);
     int length = first;
@@ -252,6 +256,7 @@ static lc_status format_new(char **out_string, uint32_t *out_length, const char 
         }
     }
     va_end(again);
+    // Only now, since FAIL_WITH returns: va_end has to come first.
     if (!enlarged)
         FAIL_WITH(LC_NULL);
     CHECK_CONDITION(first >= 0 && length == first);
@@ -292,8 +297,8 @@ lc_status snmprintf(char **out_string, uint32_t *out_length, const char *format,
 
 namespace {
 
-// lc_env_lock when it exists; before lc_init there is only one thread. The log takes it under its own lock
-// when the time zone changes, so nothing is logged while it is held.
+// Holds lc_env_lock if it exists; before lc_init there is only one thread. The log takes this lock while it
+// holds its own, when the time zone changes. Logging with lc_env_lock held could therefore deadlock.
 struct env_guard {
     env_guard() : held(lc_env_lock) {
         if (held)
@@ -321,6 +326,7 @@ lc_status lc_getenv_ts(const char *name, char **out_text) {
         found = value != nullptr;
         *out_text = safe_strdup(value);
     }
+    // Outside the lock, since a failure is logged.
     CHECK_CONDITION(!found || *out_text);
     return LC_OK;
 }
@@ -365,7 +371,8 @@ static int64_t this_thread() {
     return static_cast<int64_t>(pthread_self());
 }
 
-// The owner ends while it holds the lock: every level of it is released.
+// Destructor of the key: the thread has ended while it held the lock. A recursive lock is unlocked at every
+// level.
 static void release_at_thread_end(void *held) {
     lc_lock *lock = static_cast<lc_lock *>(held);
     while (lock->locked && lock->owner == this_thread() && lc_lock_unlock(lock) == 0) {
@@ -408,15 +415,16 @@ int lc_lock_lock(lc_lock *lock) {
         return result;
     lock->owner = this_thread();
     lock->locked = 1;
+    // If this fails for lack of memory, the lock works but isn't released at the end of the thread.
     if (lock->nesting++ == 0)
-        (void)pthread_setspecific(lock->key,
-                                  lock); // fails only for want of memory, and costs only the release
+        (void)pthread_setspecific(lock->key, lock);
     return 0;
 }
 
 int lc_lock_unlock(lc_lock *lock) {
     if (!lock || !lock->locked || lock->owner != this_thread())
         return 1;
+    // The fields are changed while the mutex is still held: after the unlock they belong to the next owner.
     if (--lock->nesting == 0 || !lock->recursive) {
         lock->nesting = 0;
         lock->owner = -1;

@@ -15,7 +15,7 @@ struct csys_display_buf {
 static_assert(sizeof(csys_display_buf) == 32);
 constexpr uint32_t OVERHEAD = sizeof(csys_display_buf) + 1; // descriptor and terminator
 
-// The memory may end on any address, so the descriptor is copied in and out.
+// The caller's memory may end at any address, so the descriptor can be unaligned: it is copied in and out.
 static csys_display_buf load(const csys_display_buf *buffer) {
     csys_display_buf copy;
     memcpy(&copy, static_cast<const void *>(buffer), sizeof copy);
@@ -52,6 +52,7 @@ uint32_t csys_append_to_safe_display_buf(csys_display_buf *buffer, const char *s
     memcpy(state.position, string, copied);
     state.position += copied;
     state.left -= copied;
+    // The caller's sign of a text that was cut, also in the output itself.
     if (!fits)
         state.position[-1] = '\n';
     *state.position = '\0';

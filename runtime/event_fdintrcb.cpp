@@ -1,16 +1,14 @@
-// The bridge: carries changes of an interest list into a loop and calls the interest's function when
-// something fires. It holds an entry for each active interest: the loop's event and a copy of the interest's
-// record.
+// The bridge from an interest list to an event loop. For each active interest it has an entry: the loop's
+// event and a copy of the interest, whose function it calls when the event occurs.
 //
-// Entries belong to the loop's thread. A change that another thread makes (a sender that finds its socket
-// full, empty again, or closed by the peer) is copied and posted to the loop; entries, loop events and the
-// open and close handlers are dealt with there, before the loop runs its next callback and in the order of
-// the changes. The poster waits for nothing, so it may hold the locks that a callback of the loop wants, and
-// an entry is never freed while the loop's thread is in its handler. On its own thread a change is carried
-// out at once, after what is posted.
+// Entries are only used on the loop's thread. If another thread changes the list (a sender finds that its
+// socket is full, that it has been emptied, or that the peer has closed it), the changes are copied and
+// posted to the loop, which applies them on its own thread, in their order and before its next callback; the
+// open and close handlers run there as well. The other thread doesn't wait and may therefore hold locks that
+// a callback of the loop takes, and no entry is freed while its handler runs. A change made on the loop's own
+// thread is applied at once, after those already posted.
 //
-// A handler works on a copy of its entry all the same: the interest's function may take its own interest
-// away.
+// A handler works on a copy of its entry, because an interest's function may remove its own interest.
 #include "runtime/event_fdintrcb.h"
 
 #include <cstdlib>
@@ -38,7 +36,7 @@ struct fdic_libevent_entry {
 };
 
 struct posted_changes {
-    loop_post post; // first, so that the record can be found again
+    loop_post post; // first: the record is found by its address
     fdic_libevent *bridge;
     fdic_event_array *changes;
 };
@@ -103,7 +101,7 @@ static fdic_libevent_entry *find_entry(const fdic_libevent *bridge, uint32_t id)
     return found ? static_cast<fdic_libevent_entry *>(value) : nullptr;
 }
 
-// ---- From the loop
+// --- From the loop
 
 static lc_status read_fired(int fd, const fdic_libevent_entry *entry) {
     const fdic_event *interest = &entry->interest;
@@ -130,6 +128,7 @@ static lc_status timer_fired(int fd, const fdic_libevent_entry *entry) {
 }
 
 static lc_status run_fired(int fd, short flags, const fdic_libevent_entry *entry) {
+    // A failure ends this round of calls; each has been logged where it was found.
     if (flags & LOOP_READ)
         CHECK_QUIET(read_fired(fd, entry));
     if (flags & LOOP_WRITE)
@@ -153,12 +152,13 @@ static void fdic_libevent_handler(int fd, short flags, void *data) {
     (void)run_fired(fd, flags, &entry);
 }
 
-// ---- Into the loop
+// --- Into the loop
 
 static lc_status drop_interest(fdic_libevent *bridge, const fdic_event *change) {
     fdic_libevent_entry *entry = find_entry(bridge, change->id);
     if (!entry)
         return LC_OK;
+    // What the handler gets is read before the entry is freed.
     const bool told = entry->interest.has_fd && bridge->close_handler;
     const int fd = entry->interest.fd;
     void *user_data = entry->interest.user_data;
@@ -179,7 +179,7 @@ static lc_status make_entry(fdic_libevent *bridge, uint32_t id, fdic_libevent_en
     CHECK_NULL(entry.pointer);
     entry.pointer->loop = bridge->loop;
     CHECK_STATUS(loop_event_new(bridge->loop, fdic_libevent_handler, entry.pointer, &entry.pointer->event));
-    // NOLINTNEXTLINE(clang-analyzer-unix.MallocSizeof): the table wants the id's bytes
+    // NOLINTNEXTLINE(clang-analyzer-unix.MallocSizeof): the key of the table is the bytes of the id
     owned_text key(static_cast<char *>(malloc(sizeof id)));
     CHECK_NULL(key.pointer);
     memcpy(key.pointer, &id, sizeof id);
@@ -200,7 +200,7 @@ static lc_status take_interest(fdic_libevent *bridge, const fdic_event *change) 
     }
     fdic_libevent_entry *entry = find_entry(bridge, change->id);
     if (!entry)
-        return LC_OK; // the handler took it away again
+        return LC_OK; // the open handler has removed it
     entry->interest = *change;
     loop_event_remove(entry->event);
     if (change->has_fd) {
@@ -213,6 +213,7 @@ static lc_status take_interest(fdic_libevent *bridge, const fdic_event *change) 
 }
 
 static lc_status carry_out(fdic_libevent *bridge, const fdic_event_array *changes) {
+    // One failure doesn't keep the other changes from being applied; the first is returned.
     lc_status result = LC_OK;
     for (uint32_t i = 0; i < fdic_event_array_length_quick(changes); i++) {
         const fdic_event *change = fdic_event_array_get_quick(changes, i);

@@ -1,9 +1,10 @@
-// Interest lists. A list holds what is wanted now and what the change callback has been told; each operation
-// changes the first and then compares the two, and what differs goes to the callback. The callback runs last,
-// when both arrays are whole again, so it may change the list in its turn.
+// Interest lists.
 //
-// No lock and no thread of its own: whoever uses a list guards it, as a session's instance does with its
-// lock.
+// A list has two arrays: the current interests, and those that the change callback has been given last. Each
+// operation changes the first one, then compares it with the second and passes the differences to the
+// callback. The callback is called last, when both arrays are consistent, so it may change the list itself.
+//
+// A GCL instance (mgmt/gcl.h) is the user of a list, and its lock guards it.
 #include "runtime/fdintrcb.h"
 
 #include <cstdlib>
@@ -59,15 +60,16 @@ static fdic_event *find(const fdic_event_array *events, uint32_t id, uint32_t *o
     return fdic_event_array_get_quick(events, *out_index);
 }
 
-// ---- The compare step
+// --- The compare step
 
 static bool is_usable(const fdic_event *event) {
     return (event->has_fd && event->fd >= 0) || (event->has_timer && event->delay >= 0);
 }
 
+// Whether the callback knows the interest as it is.
 static bool is_told(const fdic_event *event, const fdic_event *reported) {
     if (!reported)
-        return !event->active; // came and went untold
+        return !event->active; // removed before it was ever reported
     if (event->active != reported->active || event->has_fd != reported->has_fd ||
         event->has_timer != reported->has_timer)
         return false;
@@ -107,6 +109,7 @@ static lc_status compare(fdic *context, bool all, fdic_event_array **out) {
         CHECK_STATUS(report(context, event));
         CHECK_STATUS(fdic_event_array_insert_sorted(result.pointer, event));
     }
+    // From the end, so that the positions that are still to come don't change.
     for (uint32_t i = count; i-- > 0;)
         if (!fdic_event_array_get_quick(context->current, i)->active)
             CHECK_STATUS(fdic_event_array_delete(context->current, i));
@@ -122,7 +125,7 @@ static lc_status tell_changes(fdic *context) {
     return LC_OK;
 }
 
-// ---- Changes
+// --- Changes
 
 static lc_status add(fdic *context, fdic_event *event, int32_t *out_id) {
     event->context = context;
@@ -173,7 +176,7 @@ lc_status fdic_event_add_timer(fdic *context, int64_t delay_ms, void *user_data,
     return LC_OK;
 }
 
-// The current record of an id; `what` says in the log what an unknown one was asked for.
+// Finds the interest with this id. `what` was to be done with it, for the log line about an unknown id.
 static lc_status find_current(const fdic *context, int32_t id, const char *what, fdic_event **out) {
     uint32_t index = 0;
     CHECK_NULL(context);

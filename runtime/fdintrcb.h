@@ -1,5 +1,6 @@
-// Interest lists: the descriptors and timers that a library wants to hear about. One change callback passes
-// them to the loop that serves the list. A list has no lock of its own; its user's lock guards it.
+// Interest lists: the descriptors and timers that a library wants to be called for, independent of the event
+// loop that watches them. A change callback passes each change on to the loop (runtime/event_fdintrcb.h is
+// one). A list has no lock; its owner's lock guards it.
 #pragma once
 
 #include <cstdint>
@@ -7,7 +8,7 @@
 #include "runtime/common.h"
 #include "runtime/typed_arrays.h"
 
-// Why an interest function is called.
+// Why an interest's function is called.
 enum : uint32_t {
     FDIC_READABLE = 1,
     FDIC_WRITABLE = 2,
@@ -18,10 +19,11 @@ enum : uint32_t {
 using fdic_handler = lc_status (*)(int fd, uint32_t kind, void *user_data, void *argument);
 
 struct fdic;
+// An interest, in a descriptor (has_fd) or a timer (has_timer).
 struct fdic_event {
     fdic *context;
-    uint32_t id; // 0 is invalid
-    int32_t active;
+    uint32_t id;    // 0 is invalid
+    int32_t active; // 0: to be removed
     int32_t has_fd;
     int32_t fd;
     void *user_data;
@@ -36,13 +38,18 @@ struct fdic_event {
     void *timer_argument;
 };
 
-// fdic_event_array (typed_arrays.h): sorted by id, an equal one is replaced. Freed by whoever asked for it.
+// The array fdic_event_array is declared in typed_arrays.h. It is sorted by id, and a record replaces one of
+// its id.
 
-// The changes stay the list's; they are freed when the callback returns.
+// Gets the interests that have changed, one with `active` 0 if it was removed. They are freed after the
+// callback returns.
 using fdic_change_callback = lc_status (*)(const fdic_event_array *changes, void *user_data);
 
 lc_status fdic_init(fdic **out, fdic_change_callback callback, void *user_data);
 lc_status fdic_deinit(fdic **inout);
+// Ids are greater than 0; -1 on failure. An unknown id is logged and gives LC_NOT_FOUND. An interest in a
+// descriptor below 0, or a timer with a negative delay, is removed at once, without a call of the change
+// callback if it was never reported. A timer runs once; to run it again, set another delay.
 lc_status fdic_event_add_fd(fdic *context, int32_t fd, int32_t want_read, int32_t want_write, void *user_data,
                             fdic_handler read_function, void *read_argument, fdic_handler write_function,
                             void *write_argument, int32_t *out_id);
@@ -52,5 +59,5 @@ lc_status fdic_event_add_timer(fdic *context, int64_t delay_ms, void *user_data,
                                void *timer_argument, int32_t *out_id);
 lc_status fdic_event_update_timer(fdic *context, int32_t id, int64_t delay_ms);
 lc_status fdic_event_delete_timer(fdic *context, int32_t id);
-// A copy of every record.
+// A copy of all interests, for the caller to free.
 lc_status fdic_events_query(fdic *context, fdic_event_array **out);

@@ -1,13 +1,16 @@
-// Scope guards. Threads are ended by cancellation, which unwinds the stack and runs these destructors:
-// whatever is held goes in one of them. A destructor must not reach a cancellation point (close, write, poll,
-// ...), since a cancellation inside it ends the process; what has to call one turns cancellation off around
-// it.
+// Scope guards. The threads of the engine are ended by cancellation, which takes effect at the next
+// cancellation point (close, write, poll, sleep, ...) and unwinds the stack, running destructors. A resource
+// that is held across a cancellation point must therefore be owned by a guard.
+//
+// A destructor must not reach a cancellation point itself: destructors are noexcept, and unwinding out of one
+// ends the process. One that has to call close() for example disables cancellation first (cancel_off_guard).
 #pragma once
 
 #include <pthread.h>
 
 #include <cstdlib>
 
+// Holds a mutex until the end of the scope or release(), whichever comes first.
 struct mutex_guard {
     explicit mutex_guard(pthread_mutex_t *mutex) : held(mutex) { pthread_mutex_lock(held); }
     ~mutex_guard() { release(); }
@@ -22,7 +25,8 @@ struct mutex_guard {
     pthread_mutex_t *held;
 };
 
-// No cancellation from here to the end of the scope.
+// Disables cancellation of the calling thread for a scope. A request that arrives meanwhile takes effect at
+// the first cancellation point after it. Guards nest.
 struct cancel_off_guard {
     cancel_off_guard() { pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &previous); }
     ~cancel_off_guard() { pthread_setcancelstate(previous, nullptr); }
@@ -31,7 +35,8 @@ struct cancel_off_guard {
     int previous = PTHREAD_CANCEL_ENABLE;
 };
 
-// Owns a pointer until taken; `Free` is called with it otherwise.
+// Owns a pointer and calls `Free` with it at the end of the scope, unless it is null or has been taken.
+// `pointer` may be passed as an out argument; a pointer that it held before is not freed.
 template <typename T, void (*Free)(T *)>
 struct owned {
     explicit owned(T *taken = nullptr) : pointer(taken) {}

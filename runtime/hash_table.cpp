@@ -1,6 +1,7 @@
-// The chained hash table. Buckets are singly linked; new entries go to the end of their chain. The table is
-// resized after each insertion and deletion, when it has become too full or too empty; without memory for
-// that it goes on with the buckets that it has.
+// The chained hash table. A bucket is a singly linked list of entries; new entries are added at its end.
+// After each insertion and deletion the number of buckets is adapted: it grows at more than 3 entries per
+// bucket and shrinks at less than one entry per 6 buckets. If there is no memory for that, the table keeps
+// the buckets that it has.
 #include "runtime/hash_table.h"
 
 #include <algorithm>
@@ -10,7 +11,7 @@
 #include "runtime/guards.h"
 #include "runtime/logging.h"
 
-// ---- Hash: Jenkins' lookup2 over the key's bytes
+// --- Hash: Jenkins' lookup2 over the key's bytes
 
 namespace {
 
@@ -49,7 +50,8 @@ uint32_t ht_bjh_hash(const void *key, uint32_t length, uint32_t initial) {
         state.c += little_endian(bytes + 8, 4);
         state.mix();
     }
-    state.c += length; // its lowest byte is the length's, so the last bytes begin one higher
+    // The lowest byte of c is reserved for the length; the remaining key bytes go into the other three.
+    state.c += length;
     state.a += little_endian(bytes, rest);
     if (rest > 4)
         state.b += little_endian(bytes + 4, rest - 4);
@@ -65,7 +67,7 @@ int ht_key_equal_string_func(const void *a, uint32_t a_length, const void *b, ui
     return a_length == b_length && memcmp(a, b, a_length) == 0;
 }
 
-// ---- Life
+// --- Life
 
 void ht_default_options(ht_options *out) {
     *out = ht_options{};
@@ -128,6 +130,7 @@ static void resize(ht *table, uint32_t bucket_count) {
     table->bucket_count = bucket_count;
 }
 
+// Grows or shrinks the table if its load is out of bounds.
 static void fit(ht *table) {
     const uint64_t entries = table->entry_count;
     uint32_t buckets = table->bucket_count;
@@ -136,6 +139,7 @@ static void fit(ht *table) {
     } else if (buckets >
                std::max<uint64_t>(ht_table_resize_shrink_load_factor * entries, ht_table_size_initial)) {
         uint32_t before;
+        // In one step, however far: ht_empty of a large table leads here.
         do {
             before = buckets;
             buckets /= ht_table_resize_factor;
@@ -144,7 +148,7 @@ static void fit(ht *table) {
     }
 }
 
-// Takes one entry out of its chain and frees it; it is gone whatever its free function says.
+// Unlinks one entry and frees it. It is gone even if its free function fails, which gives LC_GENERIC.
 static lc_status drop(ht *table, ht_entry **link) {
     ht_entry *entry = *link;
     *link = entry->next;
@@ -187,14 +191,14 @@ lc_status ht_free(ht **inout) {
     return LC_OK;
 }
 
-// ---- Entries
+// --- Entries
 
 static uint32_t length_of(const void *key, int32_t key_length) {
     return key_length < 0 ? static_cast<uint32_t>(strlen(static_cast<const char *>(key)))
                           : static_cast<uint32_t>(key_length);
 }
 
-// The link to the entry of this key, or to the null at the end of its chain.
+// The pointer that points to this key's entry, or the null pointer at the end of its chain.
 static ht_entry **find(const ht *table, const void *key, uint32_t length) {
     ht_entry **link = &table->buckets[table->hash_function(key, length) % table->bucket_count];
     while (*link && !table->key_equal_function((*link)->key, (*link)->key_length, key, length))
@@ -211,11 +215,12 @@ lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value)
     owned<ht_entry, release_entry> entry(static_cast<ht_entry *>(calloc(1, sizeof(ht_entry))));
     CHECK_NULL(entry.pointer);
     *entry.pointer = {const_cast<void *>(key), length, value, nullptr};
+    // Deletes an old entry of this key. This may resize the table, so the place is looked up only afterwards.
     CHECK_STATUS(ht_delete(table, key, key_length));
     if (table->insert_function)
         CHECK_STATUS(table->insert_function(key, length, value, table->user_word, &entry.pointer->key,
                                             &entry.pointer->value));
-    *find(table, key, length) = entry.take(); // the end of its chain
+    *find(table, key, length) = entry.take(); // the key is not there, so this is the end of its chain
     table->entry_count++;
     fit(table);
     return LC_OK;

@@ -1,5 +1,6 @@
-// A chained hash table over keys of bytes. Without an insert function the table keeps the caller's key and
-// value pointers, which its free function then has to free.
+// A chained hash table; a key is a sequence of bytes. Without an insert function the table stores the
+// caller's key and value pointers, and its free function, if any, has to free them. Not locked: the owner's
+// lock guards it.
 #pragma once
 
 #include <cstdint>
@@ -14,7 +15,8 @@ constexpr uint32_t ht_table_resize_shrink_load_factor = 6;
 
 using ht_hash_function = uint32_t (*)(const void *key, uint32_t key_length);
 using ht_key_equal_function = int (*)(const void *a, uint32_t a_length, const void *b, uint32_t b_length);
-// Makes what the table stores of a key and a value.
+// Makes the key and the value that are stored, copies for example, of those that the caller passes to
+// ht_insert.
 using ht_insert_function = lc_status (*)(const void *key, uint32_t key_length, void *value, void *user_word,
                                          void **out_key, void **out_value);
 using ht_free_function = lc_status (*)(void *key, uint32_t key_length, void *value, void *user_word);
@@ -47,6 +49,7 @@ struct ht {
 };
 
 void ht_default_options(ht_options *out);
+// Bob Jenkins' lookup2 hash; `length` in bytes.
 uint32_t ht_bjh_hash(const void *key, uint32_t length, uint32_t initial);
 uint32_t ht_hash_string_func(const void *key, uint32_t length);
 int ht_key_equal_string_func(const void *a, uint32_t a_length, const void *b, uint32_t b_length);
@@ -54,11 +57,12 @@ int ht_key_equal_string_func(const void *a, uint32_t a_length, const void *b, ui
 lc_status ht_new(ht **out, const ht_options *options);
 lc_status ht_empty(ht *table);
 lc_status ht_free(ht **inout);
-// A key length of -1 takes strlen. LC_EXISTS when duplicates are refused; else an old entry is deleted before
-// the new one is made. When its free function fails the result is LC_GENERIC: the old entry has gone, and key
-// and value stay the caller's.
+// `key_length` in bytes; -1 means strlen(key). A key that is in the table already is LC_EXISTS if duplicates
+// are refused; otherwise its entry is deleted before the new one is made. If the free function fails for the
+// old entry, the result is LC_GENERIC: the old entry is gone, and the new key and value stay the caller's.
 lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value);
-// A missing key gives 0 and `out_found` 0, with key length -1. Outs may be null.
+// A missing key is not a failure: `out_found` is 0 and `out_key_length` -1. Outs may be null. What they give
+// stays the table's.
 lc_status ht_lookup(const ht *table, const void *key, int32_t key_length, int *out_found, void **out_key,
                     int32_t *out_key_length, void **out_value);
-lc_status ht_delete(ht *table, const void *key, int32_t key_length); // a missing key is no error
+lc_status ht_delete(ht *table, const void *key, int32_t key_length); // 0 for a missing key

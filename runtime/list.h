@@ -1,11 +1,12 @@
-// Intrusive doubly linked lists. A record has two members: `next`, the following record, and `prev_link`, the
-// pointer that points to this record (the head, or the `next` of the record before). A record therefore
-// unlinks itself without the head, and the list owns nothing.
+// Intrusive doubly linked lists. A record has two members: `next`, the following record or null, and
+// `prev_link`, the address of the pointer that points to this record (the list's head, or the `next` of the
+// record before it). That is why a record can be unlinked without knowing its list. A list does not own its
+// records.
 //
-// The caller holds whatever lock guards the list. Nothing here allocates or fails.
+// The caller holds the lock that guards the list. Nothing here allocates or fails.
 #pragma once
 
-// New first record.
+// Inserts a record at the front.
 template <typename T>
 void list_push_head(T **head, T *record) {
     record->next = *head;
@@ -14,12 +15,12 @@ void list_push_head(T **head, T *record) {
         (*head)->prev_link = &record->next;
     *head = record;
 }
-// New record directly after `place`.
+// Inserts a record directly after `place`.
 template <typename T>
 void list_insert_after(T *place, T *record) {
     list_push_head(&place->next, record);
 }
-// Takes the record out of its list and clears both its pointers.
+// Removes the record from its list and sets both its pointers to null.
 template <typename T>
 void list_unlink(T *record) {
     *record->prev_link = record->next;

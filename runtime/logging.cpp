@@ -1,18 +1,18 @@
-// The log state of the process and the one function through which every line goes.
+// The log state of the process, and lc_log_internal, through which every line is written.
 //
-// Any thread may log. The state is guarded by G_log_state_lock; the level cells are read without it, so that
-// a line which doesn't pass costs two loads. Cancellation is off while the lock is held: a cancelled thread
-// never takes it along. Buffers are on the stack and lines of ordinary length allocate nothing, so that
-// logging works when memory has run out. Lines go to the log daemon through syslog_socket.cpp, which never
-// blocks for long; a line that was lost to a daemon that doesn't read is counted, and the count told ahead of
-// the next line that gets through.
+// Any thread may log. G_log_state_lock guards the state; the levels are atomic and are read without it, so
+// that a line which isn't written costs two loads. Cancellation is disabled while the lock is held. The
+// buffers are on the stack, and a line of ordinary length allocates nothing, so logging works when memory is
+// exhausted. syslog_socket.cpp sends the lines and never blocks for long; lines that are lost because the
+// daemon doesn't read are counted, and the number is logged before the next line that can be sent.
 //
-// The lock is made by the first lc_log_init, or by a first line of the main thread, and stays until the
-// process ends: a thread that logs after lc_log_close finds no state under it and its line is dropped. What
-// the log itself calls under its lock may meet a failure and want to log that; such a line is dropped too.
+// The lock is created by the first lc_log_init, or by a first line of the main thread, and never destroyed: a
+// thread that logs after lc_log_close finds no state, and its line is dropped. A function that the log calls
+// with its lock held may fail and log that; such a line is dropped too (inside_the_log).
 //
-// The caller's format is appended to the line's own head and used once: the head holds no "%". A format
-// that had to be cut is cut ahead of a conversion that it would end in.
+// A line is formatted once: the caller's format is appended to the head of the line, which contains no "%".
+// If the two are longer than FORMAT_CHARACTERS, they are cut, and a conversion at the end that is now
+// incomplete is removed.
 #include "runtime/logging_levels.h"
 
 #include <pthread.h>
@@ -41,8 +41,8 @@ std::atomic<int32_t> G_logging_suspended;
 lc_log_state *G_log_state;
 lc_lock *G_log_state_lock;
 
-static int32_t lost_lines;               // to a log daemon that would have blocked; under the state's lock
-static thread_local bool inside_the_log; // this thread holds the state's lock
+static int32_t lost_lines;               // because the daemon didn't read; G_log_state_lock guards it
+static thread_local bool inside_the_log; // this thread holds G_log_state_lock
 
 // --- Start and end
 
@@ -92,7 +92,8 @@ static lc_status init_locked(const char *process_name, const char *prefix, uint3
     state->system_override = state->class_override = 0;
     strlcpy(state->prefix, prefix ? prefix : "", sizeof state->prefix);
     strlcpy(state->process_name, process_name, sizeof state->process_name);
-    state->level_link_changed = log_level_link_time(); // ahead of the link: a later change is seen as one
+    // The time is read before the link: a change between the two is then noticed at the next look.
+    state->level_link_changed = log_level_link_time();
     log_take_system_level(state);
     state->current_level =
         state->class_override ? state->override_level : static_cast<uint8_t>(state->system_level);
@@ -104,7 +105,7 @@ static lc_status init_locked(const char *process_name, const char *prefix, uint3
             syslog_socket_close(&state->log_daemon);
         state->openlog_options = options;
         syslog_socket_open(&state->log_daemon, state->process_name, (options & LOG_PID) != 0, facility);
-        // For code of others that calls syslog itself. Without LOG_NDELAY this opens nothing.
+        // For libraries that call syslog(3) themselves. Without LOG_NDELAY this opens no socket.
         static char ident[sizeof state->process_name];
         closelog();
         strlcpy(ident, state->process_name, sizeof ident);
@@ -152,7 +153,7 @@ const char *lc_log_get_lls_process_name() {
     return G_log_state ? G_log_state->process_name : "";
 }
 
-// The first line of a process that never set logging up.
+// Sets the log up for a process that logs before lc_log_init, under the name of its program.
 static lc_status init_unnamed() {
     char path[32], name[80] = "";
     snprintf(path, sizeof path, "/proc/%d/cmdline", static_cast<int>(getpid()));
@@ -172,7 +173,7 @@ static lc_status init_unnamed() {
 
 namespace {
 
-// One log line in the making.
+// What a line consists of, besides the caller's text.
 struct log_line {
     lc_log_state *state;
     const char *function;
@@ -191,13 +192,15 @@ struct line_format {
 } // namespace
 
 static void add(line_format *format, const char *pattern, ...) __attribute__((format(printf, 2, 3)));
-// Drops what a cut has left of a conversion at the end of a format.
+// Removes an incomplete conversion from the end of a format that was cut.
 static void drop_half_conversion(line_format *format) {
     const char *const end = format->text + format->used;
     for (const char *at = format->text; at < end;) {
         if (*at++ != '%')
             continue;
         const char *const begin = at - 1;
+        // Flags, width, precision and length. If the conversion character that must follow is missing, it was
+        // cut off.
         at += strspn(at, "-+ #0'I*.123456789hlqjztL");
         if (at < end) {
             at++;
@@ -224,6 +227,7 @@ static void add(line_format *format, const char *pattern, ...) {
 }
 
 static void add_stamp(line_format *format, const log_line *line) {
+    // The finest stamp that is asked for is used, so it comes first.
     static const struct {
         uint32_t flag;
         long divisor;
@@ -317,7 +321,7 @@ static void write_out(const log_line *line, const line_format *full, const line_
         uint8_t destination;
         FILE **stream;
     } consoles[] = {{LOG_TO_STDOUT, &stdout}, {LOG_TO_STDERR, &stderr}};
-    const int saved = errno; // what a "%m" in the format means
+    const int saved = errno; // for a "%m" in the format
     if (line->state->destinations & LOG_TO_SYSLOG) {
         va_list copy;
         va_copy(copy, arguments);
@@ -349,6 +353,7 @@ static lc_status log_locked(log_line *line, int saved_errno, const char *format,
     timeval now;
     gettimeofday(&now, nullptr);
     log_poll_level_link(state, now.tv_sec);
+    // Repeated under the lock: the level link may just have changed the level.
     if (!lc_log_check_level(line->level) ||
         (line->level > state->initial_max_level && G_daemon_log_level == -1))
         return LC_OK;
@@ -363,6 +368,7 @@ static lc_status log_locked(log_line *line, int saved_errno, const char *format,
     build_body(&body, line, format);
     if (state->time_header)
         add(&full, "%s", body.text);
+    // The functions above may have changed errno, and the caller's format may contain "%m".
     errno = saved_errno;
     write_out(line, &full, &body, arguments);
     state->lines++;
@@ -374,6 +380,7 @@ lc_status lc_log_internal(const char *function, const char *file, int line, uint
                           uint32_t component, int32_t level, const char *format, ...) {
     if (G_logging_suspended)
         return LC_OK;
+    // Before anything that could change it, so that the caller's errno survives.
     const int saved_errno = errno;
     if (!lc_log_check_level(level))
         return LC_OK;
@@ -430,6 +437,7 @@ int lc_log_file(const char *path, const char *format, ...) {
     const cancel_off_guard uncancelled;
     struct stat status = {};
     const bool small = stat(DEBUG_LOG, &status) != 0 || status.st_size <= DEBUG_LOG_MAX_BYTES;
+    // A file that has become too large is truncated rather than rotated.
     FILE *file = fopen(path ? path : DEBUG_LOG, small ? "ae" : "we");
     if (!file)
         return 1;

@@ -1,12 +1,14 @@
-// What decides whether a line is written and which facility it carries.
+// Log levels and the syslog facility.
 //
-// Three sources decide the level: the system level (from a link in the file system, later from management),
-// an override level that counts while both its switches are on, and ahead of them the level of this process.
-// The first two make G_log_level; the last is G_daemon_log_level, which the level test prefers. The mask of
-// the log daemon's socket follows whichever counts. A process that logs to a console keeps its level.
+// Three levels determine what is written: the system level (from a symbolic link at start, later from the
+// management tree); an override level, which replaces it while both its switches are on; and the level of
+// this process, which takes precedence over both. The first two are combined in G_log_level, the last is
+// G_daemon_log_level. The mask of the syslog socket is set to the effective one. A process that logs to a
+// console keeps the level that it started with.
 //
-// These operations run on the main thread, any of the others may be logging: the record is changed under its
-// lock, and what can log is done before the lock is taken.
+// The main thread calls the functions that change a level, while other threads may be logging. They change
+// the state under its lock; anything that could fail and log is done before the lock is taken or after it is
+// released. That is why most of them have a part of their own for what is done under the lock.
 #include "runtime/logging_levels.h"
 
 #include <cerrno>
@@ -56,7 +58,8 @@ bool log_is_managed(const char *process_name) {
 
 // --- The level link
 
-// The link's target is a decimal level. False when there is no link, or one that says something else.
+// The link's target is the level as a decimal number. False if there is no link, or its target is anything
+// else.
 static bool read_level_link(int32_t *out_level) {
     char target[16];
     const ssize_t length = readlink(LEVEL_LINK, target, sizeof target - 1);
@@ -78,6 +81,7 @@ void log_take_system_level(lc_log_state *state) {
     state->system_level = static_cast<int8_t>(level);
 }
 
+// `look`: stat or lstat.
 static timespec changed_at(const char *path, int (*look)(const char *, struct stat *)) {
     struct stat status = {};
     return look(path, &status) == 0 ? status.st_mtim : timespec{};
@@ -133,7 +137,7 @@ bool log_poll_time_zone(lc_log_state *state, time_t now) {
 
 namespace {
 
-// The log state under its lock, null before lc_log_init and after lc_log_close.
+// The log state, with its lock held for a scope; null before lc_log_init and after lc_log_close.
 struct locked_state {
     locked_state() : guard(G_log_state_lock), state(G_log_state_lock ? G_log_state : nullptr) {}
     const cancel_off_guard uncancelled;
@@ -179,6 +183,7 @@ int32_t lc_log_get_daemon_log_level() {
     return G_daemon_log_level;
 }
 
+// Makes the override level current, or the system level.
 static void settle_overrides(lc_log_state *state, bool overrides) {
     state->current_level = overrides ? state->override_level : static_cast<uint8_t>(state->system_level);
     if (!has_console(state))
@@ -191,6 +196,8 @@ static lc_status switch_override(int32_t system_wide, int32_t enable) {
         return LC_NULL;
     (system_wide ? log.state->system_override : log.state->class_override) = enable;
     settle_overrides(log.state, overridden(log.state));
+    // Turning the class's switch off leaves an override level that changes nothing when it is turned on
+    // again.
     if (!system_wide && !enable)
         log.state->override_level = log.state->current_level;
     return LC_OK;
@@ -201,7 +208,7 @@ lc_status lc_log_enable_override_log_level(int32_t system_wide, int32_t enable) 
     return LC_OK;
 }
 
-// A level of -1 means the system level. An override that ends so no longer counts.
+// -1 means the system level, and turns the class's switch off.
 static lc_status set_override_level(int32_t level) {
     const locked_state log;
     if (!log.state)

@@ -1,8 +1,9 @@
-// The event loop as the rooms below the daemon see it. The daemon defines everything here; a program that
-// links these rooms without the daemon links the loop with them.
+// The event loop as the lower rooms use it. It is defined by daemon/libevent_loop.cpp and
+// daemon/libevent_wrapper.cpp, which tunneld links as well (the library wccp_loop).
 //
-// A wrapper context (`lew`) belongs to the thread that made it: only that thread dispatches, and every
-// callback runs on it with the loop's lock held. Waits nest: a callback may dispatch again, to any depth.
+// A wrapper context (`lew`) belongs to the thread that created it, its owner: only the owner dispatches, and
+// every callback runs on the owner's thread with the loop's lock held. Dispatching nests: a callback may
+// dispatch again, to any depth. Unless noted otherwise a function is called by the owner.
 #pragma once
 
 #include <cstdint>
@@ -10,56 +11,62 @@
 #include "runtime/common.h"
 
 struct lew;          // wrapper context, one for each thread that runs a loop
-struct lew_event;    // one registration, owned by the context through the caller's slot
+struct lew_event;    // one registration; the context owns it, and the caller's slot points to it
 struct loop_context; // the loop under a wrapper context
-struct loop_event;   // one descriptor or time-out event of a loop
+struct loop_event;   // one descriptor or timer event of a loop
 
-// What fired: the loop flags of a callback.
+// What has happened; the `flags` of a callback.
 enum : short { LOOP_TIMEOUT = 0x01, LOOP_READ = 0x02, LOOP_WRITE = 0x04, LOOP_SIGNAL = 0x08 };
 
 using lew_callback = lc_status (*)(int number, short flags, void *data, lew *context);
 
 lc_status lew_init(lew **out);
 lc_status lew_get_event_context(lew *context, loop_context **out);
-// Signal numbers 1 to 65. The slot has to outlive the registration; it reads null again after
-// lew_event_delete or lew_deinit. A filled slot is registered anew.
+// Calls `callback` for signals 1 to 65. `inout_slot` points to the caller's pointer to the registration,
+// which must outlive it; lew_event_delete and lew_deinit set it to null. A slot that is in use is registered
+// again.
 lc_status lew_event_reg_signal(lew *context, lew_event **inout_slot, int signal_number, lew_callback callback,
                                void *data);
+// Cancel disables a registration and keeps it; delete frees it. Both accept a slot that is null.
 lc_status lew_event_cancel(lew *context, lew_event **slot);
 lc_status lew_event_delete(lew *context, lew_event **inout_slot);
 lc_status lew_delete_all_events(lew *context);
-// The outs may be null; both are cleared first. `out_no_events`: nothing at all remained registered.
-// `out_escaped`: lew_escape_from_dispatch ended it, which lasts: later dispatches end at once as well.
+// lew_dispatch runs callbacks and posted work until nothing is registered any more or
+// lew_escape_from_dispatch is called; lew_dispatch_once returns as soon as anything has run. Outs may be
+// null, and are cleared first. `out_no_events`: nothing was registered any more. `out_escaped`:
+// lew_escape_from_dispatch has been called, which is permanent: later dispatches return at once.
 lc_status lew_dispatch(lew *context, int *out_no_events, int *out_escaped);
 lc_status lew_dispatch_once(lew *context, int *out_no_events, int *out_escaped);
-// From any thread. Called from another thread than the owner's it returns once no callback is running, and
+// From any thread. When another thread than the owner calls it, no callback is running when it returns, and
 // none starts afterwards.
 lc_status lew_escape_from_dispatch(lew *context);
-// By the owner, or by anybody once the owner's thread has ended.
+// By the owner, or by any thread after the owner's thread has ended.
 lc_status lew_deinit(lew **inout_context);
 
-// Descriptor and time-out events. All of these on the owner's thread, or when it has ended.
+// Descriptor and timer events. By the owner, or by any thread after the owner's thread has ended.
 using loop_function = void (*)(int fd, short flags, void *data);
 lc_status loop_event_new(loop_context *context, loop_function function, void *data, loop_event **out);
-// Watches `fd` for LOOP_READ, LOOP_WRITE or both until told otherwise. Takes the event out first when it was
-// in.
+// Calls the event's function whenever `fd` is ready for what `flags` asks, LOOP_READ, LOOP_WRITE or both,
+// until the event is removed. An event that is active already is removed first, also by loop_event_set_timer.
 lc_status loop_event_set_fd(loop_event *event, int fd, short flags);
-// Fires once with LOOP_TIMEOUT after `delay_ms`.
+// Calls the event's function once, with LOOP_TIMEOUT, after `delay_ms` milliseconds.
 lc_status loop_event_set_timer(loop_event *event, int64_t delay_ms);
-// An event that is taken out or freed does not run, also when it has fired already.
+// Once an event is removed or freed its function isn't called any more, even if the event was already due.
 void loop_event_remove(loop_event *event);
 void loop_event_free(loop_event **inout_event);
 
-// Work for the owner's thread, from any thread: the record is the head of the caller's own. `function` gets
-// it back on the owner's thread before the next callback runs, in the order of posting, with `carry_out` 0
-// when the loop ends first or the work was withdrawn, and frees it in either case. The poster waits for
-// nothing.
+// Work that any thread posts to the owner. A loop_post is the first member of the poster's own record.
+// `function` is called with it on the owner's thread before the next callback, in the order of posting, and
+// frees it. When the work is withdrawn or the loop is freed first, it is called with `carry_out` 0 and only
+// frees the record.
 struct loop_post {
     loop_post *next;
     const void *poster;
     void (*function)(loop_post *post, int carry_out);
 };
-int loop_is_own_thread(const loop_context *context);
+int loop_is_own_thread(const loop_context *context); // 1 when the caller is the owner
+// Never waits for the owner, so the caller may hold locks that a callback takes.
 void loop_post_work(loop_context *context, loop_post *post);
-void loop_run_posted(loop_context *context); // owner's thread: carries out what is posted so far
+void loop_run_posted(loop_context *context); // carries out what has been posted so far
+// Withdraws all work of this poster. By the owner, or by any thread after the owner's thread has ended.
 void loop_withdraw_posted(loop_context *context, const void *poster);

@@ -1,4 +1,4 @@
-// MD5 (RFC 1321) in streaming form, over libmd.
+// MD5 (RFC 1321) in streaming form, by libmd.
 #pragma once
 
 #include <cstddef>

@@ -14,7 +14,7 @@
 namespace {
 
 sockaddr_un manager = {};
-socklen_t manager_length; // 0: there is none
+socklen_t manager_length; // 0: no service manager
 int64_t watchdog_ms = -1;
 
 bool parse_number(const char *text, int64_t *out) {
@@ -25,7 +25,7 @@ bool parse_number(const char *text, int64_t *out) {
 
 void read_socket(const char *path) {
     const size_t length = strlen(path);
-    // "@" stands for the NUL that begins an abstract name.
+    // A leading "@" stands for the NUL at the start of the name of an abstract socket (unix(7)).
     if ((path[0] != '/' && path[0] != '@') || length < 2 || length >= sizeof manager.sun_path)
         return;
     manager.sun_family = AF_UNIX;
@@ -37,6 +37,7 @@ void read_socket(const char *path) {
 
 void read_watchdog(const char *microseconds, const char *pid) {
     int64_t whose = 0, limit = 0;
+    // The watchdog may be meant for another process of the service.
     if (pid && (!parse_number(pid, &whose) || whose != getpid()))
         return;
     if (parse_number(microseconds, &limit) && limit >= 1000)

@@ -1,14 +1,15 @@
-// Reports of a program to the service manager that has started it, by the notification protocol of systemd:
-// one datagram each, to the socket named in $NOTIFY_SOCKET. Without that variable nothing is sent.
+// Status reports to the service manager, by the protocol of sd_notify(3): a datagram for each report, to the
+// socket named in $NOTIFY_SOCKET. Without that variable nothing is sent.
 #pragma once
 
 #include <cstdint>
 
-// Once, from main() and before any other thread: reads what the service manager has left in the environment
-// and removes it there, since programs that are started later are none of its services.
+// Reads the variables that the service manager has set, and removes them from the environment, so that child
+// processes don't inherit them. main() calls it once, before it starts any thread.
 void service_open();
-// "READY=1", "STOPPING=1", "WATCHDOG=1" or "STATUS=..."; several are separated by newlines. Never blocks;
-// what cannot be sent is lost. From any thread.
+// Sends "READY=1", "STOPPING=1", "WATCHDOG=1" or "STATUS=...", or several separated by newlines. Never
+// blocks; a report that can't be sent is lost. Any thread; not a cancellation point.
 void service_report(const char *state);
-// The silence, in milliseconds, after which the service manager ends the program; -1: it waits for ever.
+// The watchdog timeout: the service manager ends a program that sends no "WATCHDOG=1" for so many
+// milliseconds. -1 if the watchdog is not enabled.
 int64_t service_watchdog_ms();

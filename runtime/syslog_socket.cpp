@@ -1,19 +1,22 @@
-// The C library's syslog blocks while the log daemon doesn't read: after a dozen lines with a short queue, at
-// the latest when the send buffer is full. The engine logs under its lock, so a stopped log daemon would stop
-// the engine. Here a line is sent without blocking. A full queue is waited for as long as there is patience
-// left, some milliseconds in all; a daemon that reads empties its queue within that, so that a burst arrives
-// whole and in order. Once the patience is used up a line is tried and given up at once, until one gets
-// through, which restores it.
+// Sends lines to the syslog daemon without blocking on it.
 //
-// The wait consists of short steps with a try after each: poll() reports room only when half of the socket's
-// send buffer is free. A slow daemon may take long for that, while a line fits much earlier.
+// syslog(3) blocks while the daemon doesn't read: after about a dozen lines if the socket's queue is short,
+// at the latest when the send buffer is full. The engine logs with its lock held, so a stopped syslog daemon
+// would stop the engine. Here a line is sent without blocking. If the queue is full, the line waits, but all
+// lines together only for 30 ms (the patience). A daemon that works empties its queue in that time, so a
+// burst arrives complete and in order. When the patience is used up, each line is tried once and dropped,
+// until one is sent, which restores the patience.
 //
-// When the daemon ends, its socket ends too, and the next line connects again. A daemon that has stopped
-// while another one took over its path is noticed by the socket file when a line would be lost. Without
-// /dev/log lines are lost quietly, at the price of a look at the path. As in the C library, a /dev/log that
-// is a stream gets each line with its NUL.
+// A line waits in short steps and is tried after each, because poll() reports a socket as writable only when
+// half of its send buffer is free. A slow daemon may take long for that, although a line would fit much
+// earlier.
 //
-// One line is made in a buffer of this file, under the log's lock; only a line that is longer allocates.
+// When the daemon ends, sending fails and the line is sent on a new connection. If a daemon hangs and another
+// one has taken its path, sending doesn't fail; that is noticed by the inode of the socket file when a line
+// would be dropped. Without /dev/log, lines are dropped silently, at the cost of one stat() each. As
+// syslog(3) does, a line on a stream socket ends with a NUL.
+//
+// Lines are formatted in a static buffer, under the log's lock; only a line that is longer is allocated.
 #include "runtime/syslog_socket.h"
 
 #include <algorithm>
@@ -37,9 +40,12 @@
 constexpr const char *LOG_PATH = "/dev/log";
 constexpr size_t LINE_BYTES = 4096;
 constexpr int64_t WAIT_STEP_NS = 500000;
-constexpr int64_t LEAST_STEP_NS = 1000; // a wait that finds room each time and no place in it ends as well
+// Every step costs some patience, so that a wait also ends if poll() reports room each time and no line fits
+// in it.
+constexpr int64_t LEAST_STEP_NS = 1000;
 
-// The C library's own mask is guarded by a lock that another thread's blocked syslog call may hold.
+// Bit n is level n. setlogmask(3) isn't used, since its lock may be held by a thread that is blocked in
+// syslog(3).
 static std::atomic<int32_t> mask{0xff};
 
 void syslog_set_mask(int32_t level) {
@@ -53,7 +59,8 @@ void syslog_socket_close(syslog_socket *log) {
 }
 
 static int connect_as(syslog_socket *log, int type) {
-    struct stat file = {}; // looked at ahead of the connect: a later change is then seen as one
+    // Before connect(): if the path changes in between, the next comparison finds a difference.
+    struct stat file = {};
     if (stat(LOG_PATH, &file) != 0)
         return errno;
     const int fd = socket(AF_UNIX, type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
@@ -74,11 +81,13 @@ static int connect_as(syslog_socket *log, int type) {
     return 0;
 }
 
+// 0, or an errno. Most daemons have a datagram socket, some a stream.
 static int connect_to_daemon(syslog_socket *log) {
     const int result = connect_as(log, SOCK_DGRAM);
     return result == EPROTOTYPE ? connect_as(log, SOCK_STREAM) : result;
 }
 
+// Whether the path now leads to another socket than the one that we are connected to.
 static bool path_is_anothers(const syslog_socket *log) {
     struct stat file = {};
     return stat(LOG_PATH, &file) == 0 && (file.st_dev != log->device || file.st_ino != log->inode);
@@ -93,8 +102,8 @@ void syslog_socket_open(syslog_socket *log, const char *ident, bool with_pid, in
     (void)connect_to_daemon(log);
 }
 
-// Waits a step for room, on account of the patience. False when there is none left. A step counts for no more
-// than its own length: when the machine is so busy that this thread runs late, so does the daemon.
+// Waits one step for room. False if no patience is left. No step uses up more patience than its own length:
+// on a machine so busy that this thread runs late, the daemon does too.
 static bool wait_for_room(syslog_socket *log) {
     if (log->patience_ns <= 0)
         return false;
@@ -107,7 +116,7 @@ static bool wait_for_room(syslog_socket *log) {
     return true;
 }
 
-// Sends all of a line on the present connection: 0, or the errno of what stopped it.
+// Sends a line on the present connection. 0, or an errno.
 static int send_whole(syslog_socket *log, const char *line, size_t length) {
     size_t sent = 0;
     while (sent < length) {
@@ -118,7 +127,7 @@ static int send_whole(syslog_socket *log, const char *line, size_t length) {
             if (wait_for_room(log))
                 continue;
             if (sent > 0)
-                syslog_socket_close(log); // half a line on a stream would spoil the next one
+                syslog_socket_close(log); // otherwise the next line would be appended to this half
             return EAGAIN;
         } else if (errno != EINTR) {
             return errno;
@@ -127,13 +136,14 @@ static int send_whole(syslog_socket *log, const char *line, size_t length) {
     return 0;
 }
 
+// Sends a line and connects as often as needed, but gives up after two failures.
 static int send_line(syslog_socket *log, const char *line, size_t length) {
     int result = ENOTCONN;
     for (int failures = 0; failures < 2;) {
         if (log->fd < 0) {
             result = connect_to_daemon(log);
             if (result == EAGAIN && wait_for_room(log))
-                continue; // a stream whose daemon has yet to accept
+                continue; // a stream whose backlog is full
             if (result != 0)
                 return result;
         }
@@ -144,14 +154,15 @@ static int send_line(syslog_socket *log, const char *line, size_t length) {
         }
         if (result == EAGAIN && !path_is_anothers(log))
             return result;
-        syslog_socket_close(log); // the daemon has ended; another may listen at its path
+        syslog_socket_close(log); // the daemon has ended or been replaced
         failures++;
     }
     return result;
 }
 
-// The C library's head of a line.
+// The head of a line as syslog(3) writes it, e.g. "<139>Jan  2 03:04:05 wccpd[123]: ".
 static size_t write_head(const syslog_socket *log, int32_t level, char *line, size_t size) {
+    // Month names independent of the locale.
     static const char months[][4] = {"Jan", "Feb", "Mar", "Apr", "May", "Jun",
                                      "Jul", "Aug", "Sep", "Oct", "Nov", "Dec"};
     const time_t now = time(nullptr);
@@ -178,6 +189,7 @@ int syslog_socket_vsend(syslog_socket *log, int32_t level, const char *format, v
     const size_t length = text < 0 ? head : head + static_cast<size_t>(text);
     int result = 0;
     char *longer = nullptr;
+    // Without memory for a long line its beginning is sent.
     if (length >= sizeof line && (longer = static_cast<char *>(malloc(length + 1)))) {
         memcpy(longer, line, head);
         errno = saved_errno;

@@ -1,6 +1,12 @@
-// Growable byte buffers. One byte more than `size` is allocated, so that the NUL after the last byte has its
-// place in a full buffer; fresh memory is zero, so that a length set over it shows zero bytes and never what
-// lay there before. Counts that a reader takes from the bytes are bounded by the bytes that follow them.
+// Growable byte buffers.
+//
+// One byte more than `size` is allocated, for the NUL that follows the last byte even of a full buffer. New
+// memory is zeroed: tb_set_length may extend the length over bytes that were never written, which must not
+// show what the memory held before. A count or length that is read from the bytes is checked against the
+// bytes that follow it, before anything is allocated for it.
+//
+// A buffer grows by a factor of 4, and by at most 8 MiB more than is needed; 256 MiB is the limit. A change
+// that fails leaves the buffer as it was.
 #include "runtime/tbuffer.h"
 
 #include <algorithm>
@@ -12,8 +18,9 @@
 #include "runtime/logging.h"
 #include "runtime/tstr_array.h"
 
-// ---- Size
+// --- Size
 
+// Up to a multiple of 4096 bytes, or of 128 for less than 4096.
 static uint64_t rounded(uint64_t size) {
     const uint64_t mask = size >= tb_size_chunk_size_mask + 1 ? tb_size_chunk_size_mask : tb_size_initial - 1;
     return std::min<uint64_t>((size + mask) & ~mask, tb_size_max);
@@ -56,7 +63,7 @@ static void ended(tbuffer *buffer, uint32_t length) {
     buffer->buffer[length] = 0;
 }
 
-// ---- Life
+// --- Life
 
 lc_status tb_new_size(tbuffer **out, uint32_t size) {
     CHECK_NULL(out);
@@ -155,7 +162,7 @@ lc_status tb_dup(const tbuffer *buffer, tbuffer **out) {
     return LC_OK;
 }
 
-// ---- Plain access
+// --- Plain access
 
 int32_t tb_length(const tbuffer *buffer) {
     return buffer ? static_cast<int32_t>(buffer->length) : -1;
@@ -199,7 +206,7 @@ lc_status tb_delete_bytes(tbuffer *buffer, uint32_t offset, uint32_t count) {
     return tb_set_length(buffer, buffer->length - count);
 }
 
-// ---- Writing
+// --- Writing
 
 lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t count) {
     CHECK_NULL(buffer);
@@ -209,6 +216,7 @@ lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32
     const uint64_t end = uint64_t{offset} + count;
     if (end > buffer->length) {
         if (end + 1 > buffer->size) {
+            // Growing may move the buffer, and `bytes` would then point to freed memory.
             const auto *source = static_cast<const uint8_t *>(bytes);
             CHECK_CONDITION(source < buffer->buffer || source >= buffer->buffer + buffer->size);
             CHECK_QUIET(fit(buffer, end + 1));
@@ -216,6 +224,7 @@ lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32
         if (offset > buffer->length)
             memset(buffer->buffer + buffer->length, 0, offset - buffer->length);
     }
+    // memmove: the bytes may be in this buffer.
     if (count)
         memmove(buffer->buffer + offset, bytes, count);
     if (end > buffer->length)
@@ -239,6 +248,7 @@ static lc_status get_number(const tbuffer *buffer, uint32_t offset, void *out, u
     return LC_OK;
 }
 
+// Defines tb_put_uint32, tb_append_uint32 and tb_get_uint32 for the width 32, and so on.
 #define TB_NUMBER(width)                                                                                     \
     lc_status tb_put_uint##width(tbuffer *buffer, uint32_t offset, uint##width##_t value) {                  \
         return tb_put_buf(buffer, offset, &value, sizeof value);                                             \
@@ -257,7 +267,7 @@ lc_status tb_get_uint128(const tbuffer *buffer, uint32_t offset, uint8_t out[16]
     return get_number(buffer, offset, out, 16);
 }
 
-// ---- Strings
+// --- Strings
 
 static uint32_t in_order(uint32_t number, int swap) {
     return swap ? raw_word(to_be32(number)) : number;
@@ -321,7 +331,7 @@ lc_status tb_append_tstr_array(tbuffer *buffer, int add_nul, int swap, const tst
     return tb_put_tstr_array(buffer, buffer->length, add_nul, swap, array, nullptr);
 }
 
-// Where the text lies and how long it is, NUL excluded; `out_used` counts from `offset`.
+// The position and length of the text in the buffer, without its NUL. `out_used` counts from `offset`.
 static lc_status find_text(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul,
                            int length_word, int swap, uint32_t *out_start, uint32_t *out_length,
                            uint32_t *out_used) {

@@ -1,5 +1,6 @@
-// A growable buffer of bytes, for frames. A NUL follows the last byte. Readers check against the
-// length: a number past the end gives LC_ASSERTION, a string LC_NO_BUFFER_SPACE.
+// A growable buffer of bytes, for frames and binary values. A NUL follows the last byte. Readers check the
+// length: a number that would end past it is LC_ASSERTION, a string LC_NO_BUFFER_SPACE. Offsets, lengths and
+// sizes are in bytes. A null buffer is LC_NULL. Not locked: the owner's lock guards a buffer.
 #pragma once
 
 #include <cstdint>
@@ -18,41 +19,48 @@ constexpr uint32_t tb_size_shrink_threshold = 6;
 
 struct tbuffer {
     uint8_t *buffer;
-    uint32_t length;
-    uint32_t size;
-    uint8_t auto_shrink; // set by the owner: the buffer gives memory back when it becomes shorter
-    uint8_t constant;    // the bytes are borrowed; writers refuse
-    uint8_t placed;      // the record lies in memory that isn't the buffer's own, see tb_place
+    uint32_t length;     // bytes in use
+    uint32_t size;       // bytes allocated, without the one for the NUL
+    uint8_t auto_shrink; // set by the owner: the buffer frees memory when it becomes shorter
+    uint8_t constant;    // the bytes belong to somebody else; writers return LC_ASSERTION
+    uint8_t placed;      // the record belongs to somebody else, see tb_place
 };
 
 lc_status tb_new(tbuffer **out);
 lc_status tb_new_size(tbuffer **out, uint32_t size);
-lc_status tb_new_buf(tbuffer **out, const void *bytes, int32_t length); // -1: strlen
+lc_status tb_new_buf(tbuffer **out, const void *bytes, int32_t length); // a copy; -1 means strlen
+// Takes over memory of malloc(); on failure it stays the caller's.
 lc_status tb_new_takeover(tbuffer **out, uint8_t **inout_bytes, uint32_t length, uint32_t size);
+// A constant buffer over bytes that stay the caller's and must outlive it.
 lc_status tb_new_buf_const(tbuffer **out, const void *bytes, uint32_t length);
-// Makes a constant buffer of a record and bytes that belong to something else, and have to outlive it.
-// A NUL follows the bytes. Freeing it frees nothing.
+// Initialises a constant buffer in a record and over bytes that both belong to the caller and must outlive
+// it. A NUL follows the bytes. Freeing the buffer frees nothing.
 inline void tb_place(tbuffer *record, uint8_t *bytes, uint32_t length) {
     *record = {bytes, length, length, 0, 1, 1};
 }
 lc_status tb_free(tbuffer **inout);
+// Frees the record and gives the bytes to the caller, who frees them with free().
 lc_status tb_detach(tbuffer **inout, uint8_t **out_bytes, uint32_t *out_length);
 lc_status tb_dup(const tbuffer *buffer, tbuffer **out);
 
 int32_t tb_length(const tbuffer *buffer); // -1 for null
 uint32_t tb_size(const tbuffer *buffer);
-uint32_t tb_avail(const tbuffer *buffer); // size less length
-uint8_t *tb_buf(const tbuffer *buffer);   // a null buffer is logged
+uint32_t tb_avail(const tbuffer *buffer); // size minus length
+// The bytes; valid until the buffer is changed. Null for a null buffer, which only the first one logs.
+uint8_t *tb_buf(const tbuffer *buffer);
 uint8_t *tb_buf_maybe(const tbuffer *buffer);
 lc_status tb_ensure_size(tbuffer *buffer, uint32_t size);
-lc_status tb_set_length(tbuffer *buffer, uint32_t length); // LC_GENERIC when more than the size
+// LC_GENERIC for more than the size. With these two a reader has the buffer filled by read() for example.
+lc_status tb_set_length(tbuffer *buffer, uint32_t length);
 lc_status tb_clear(tbuffer *buffer);
+// Moves up what follows. LC_NO_BUFFER_SPACE past the end.
 lc_status tb_delete_bytes(tbuffer *buffer, uint32_t offset, uint32_t count);
 
-// An offset beyond the length fills the gap with zero bytes.
+// Overwrites or appends; a gap between the length and the offset is filled with zero bytes. `bytes` may be in
+// the buffer itself unless the buffer has to grow.
 lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t count);
 lc_status tb_append_buf(tbuffer *buffer, const void *bytes, uint32_t count);
-// One number, stored as it lies in memory: whoever writes the wire swaps it first.
+// One number in host byte order: the caller converts it from and to network byte order.
 lc_status tb_put_byte(tbuffer *buffer, uint32_t offset, uint8_t byte);
 lc_status tb_put_uint8(tbuffer *buffer, uint32_t offset, uint8_t value);
 lc_status tb_put_uint16(tbuffer *buffer, uint32_t offset, uint16_t value);
@@ -68,8 +76,9 @@ lc_status tb_get_uint32(const tbuffer *buffer, uint32_t offset, uint32_t *out);
 lc_status tb_get_uint64(const tbuffer *buffer, uint32_t offset, uint64_t *out);
 lc_status tb_get_uint128(const tbuffer *buffer, uint32_t offset, uint8_t out[16]);
 
-// A string with an optional 4-byte length word, which counts the NUL when one is added and is in network
-// order with `swap`. `length` -1 is strlen. Outs may be null; `out_written` and `out_used` count all bytes.
+// A string, with a NUL if `add_nul` is set, after an optional 4-byte length word (`length_word`), which
+// counts that NUL and is in network byte order if `swap` is set. `length` -1 means strlen. Outs may be null;
+// `out_written` and `out_used` count all of these bytes.
 lc_status tb_put_str(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
                      const char *text, int32_t length, uint32_t *out_written);
 lc_status tb_put_tstr(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
@@ -79,7 +88,8 @@ lc_status tb_append_tstr(tbuffer *buffer, int add_nul, int length_word, int swap
 lc_status tb_put_tstr_array(tbuffer *buffer, uint32_t offset, int add_nul, int swap, const tstr_array *array,
                             uint32_t *out_written);
 lc_status tb_append_tstr_array(tbuffer *buffer, int add_nul, int swap, const tstr_array *array);
-// Without a length word `length` says how much to read, -1 being all the rest. The text is the caller's.
+// Without a length word `length` is the number of bytes to read, -1 for all that follow. The result is the
+// caller's.
 lc_status tb_get_str(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
                      int swap, char **out_text, uint32_t *out_length, uint32_t *out_used);
 lc_status tb_get_tstr(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
@@ -87,7 +97,7 @@ lc_status tb_get_tstr(const tbuffer *buffer, uint32_t offset, int32_t length, in
 lc_status tb_get_tstr_array(const tbuffer *buffer, uint32_t offset, int expect_nul, int swap,
                             tstr_array **out, uint32_t *out_used);
 
-// Owner for a scope.
+// For scope guards: owned<tbuffer, tb_release>.
 inline void tb_release(tbuffer *buffer) {
     (void)tb_free(&buffer);
 }

@@ -33,8 +33,8 @@ lc_status tstr_array_new(tstr_array **out, const tstr_array_options *options) {
 }
 
 namespace {
-// What lies in front of the slots, the records and the texts of a packed array. Freeing the family's record
-// frees the whole.
+// The start of the allocation of a packed array, followed by the slots, the string records and the texts. The
+// family's record comes first, so freeing it frees everything.
 struct packed {
     tstr_array family;
     array list;
@@ -86,7 +86,7 @@ lc_status tstr_array_append_str_takeover(tstr_array *array, char **inout_text) {
     owned<tstring, ts_release> string;
     CHECK_STATUS(ts_new_str_takeover(&string.pointer, inout_text, -1, -1));
     const lc_status status = tstr_array_append_takeover(array, &string.pointer);
-    if (status != LC_OK && string.pointer) // the text stays the caller's
+    if (status != LC_OK && string.pointer) // back to the caller
         LOG_STATUS(ts_detach(&string.pointer, inout_text, nullptr));
     return status;
 }

@@ -1,9 +1,15 @@
-// Growable strings. Every change of the text is one splice: bytes out at a place, bytes in there. The buffer
-// grows before the splice and shrinks after it, so that a failure leaves the text as it was.
+// Growable strings.
 //
-// Offsets are characters in a string marked UTF-8 and bytes otherwise; they become byte offsets first, by a
-// walk that refuses what is not UTF-8. Single bytes may be added without such a check, since a character can
-// be put together from them.
+// Every change of a text is one call of splice(), which replaces some bytes at one place by others. The
+// buffer grows before the change and shrinks after it, so that a failed allocation leaves the text as it was.
+//
+// In a string that is marked UTF-8 offsets are characters. They are converted to byte offsets first, by
+// stepping through the text, which fails on invalid UTF-8. Text that is added is checked as well; only single
+// bytes are not, since a caller may assemble a character from them.
+//
+// A string doubles when it grows, by at most 8 MiB more than is needed, and halves while it is more than four
+// times as large as needed. A string in a packed array or in a message's block (ts_place) owns neither record
+// nor bytes until it grows.
 #include "runtime/tstring.h"
 
 #include <algorithm>
@@ -14,7 +20,7 @@
 #include "runtime/logging.h"
 #include "runtime/tstring_utf8.h"
 
-// ---- Size
+// --- Size
 
 static lc_status give_own_bytes(tstring *string, uint32_t size) {
     const bool placed = string->placed & ts_placed_bytes;
@@ -31,6 +37,7 @@ static lc_status give_size(tstring *string, uint32_t size) {
     return size == string->size ? LC_OK : give_own_bytes(string, size);
 }
 
+// The size is halved while it is more than four times what is needed.
 static uint32_t shrunk(uint32_t size, uint64_t need) {
     while (size > 4 * need && size > ts_size_initial)
         size = std::max(size / ts_resize_factor, ts_size_initial);
@@ -60,9 +67,10 @@ static void ended(tstring *string, int32_t length) {
     string->characters = string->utf8 ? utf8_count(string->buffer, length) : length;
 }
 
-// ---- The one change
+// --- The one change
 
 static lc_status splice(tstring *string, int32_t at, int32_t removed, const char *bytes, int64_t added) {
+    // The text may be part of the string itself (ts_append(s, s)), which moves when the buffer grows.
     owned_text copy;
     if (added > 0 && bytes >= string->buffer && bytes < string->buffer + string->size) {
         copy.pointer = static_cast<char *>(malloc(static_cast<size_t>(added)));
@@ -92,7 +100,7 @@ static lc_status byte_offset(const tstring *string, int32_t offset, int32_t *out
     return utf8_skip(string->buffer, string->length, offset, out_bytes);
 }
 
-// Bytes that `count` characters from `at` take, as far as there are any.
+// The number of bytes of `count` characters from byte `at` on, or of as many as there are.
 static lc_status span(const tstring *string, int32_t at, int32_t count, int32_t *out_bytes) {
     const int32_t rest = string->length - at;
     if (!string->utf8) {
@@ -103,7 +111,7 @@ static lc_status span(const tstring *string, int32_t at, int32_t count, int32_t 
                      out_bytes);
 }
 
-// ---- Life
+// --- Life
 
 lc_status ts_new_size(tstring **out, uint32_t size) {
     CHECK_NULL(out);
@@ -254,7 +262,7 @@ lc_status ts_dup_str(const tstring *string, char **out_text, int32_t *out_length
     return LC_OK;
 }
 
-// ---- Reading
+// --- Reading
 
 static const char *base_name(const char *file) {
     const char *slash = file ? strrchr(file, '/') : nullptr;
@@ -305,6 +313,7 @@ lc_status ts_find_char(const tstring *string, int32_t start, char byte, int32_t 
     if (start >= string->characters)
         return LC_OK;
     CHECK_STATUS(byte_offset(string, std::max(start, 0), &at));
+    // memchr on a byte: in a UTF-8 string only ASCII characters can be found.
     const void *found = memchr(string->buffer + at, byte, static_cast<size_t>(string->length - at));
     if (found)
         *out_offset = characters_before(string, static_cast<const char *>(found));
@@ -323,7 +332,7 @@ lc_status ts_rfind_char(const tstring *string, int32_t start, char byte, int32_t
     return LC_OK;
 }
 
-// ---- Writing
+// --- Writing
 
 lc_status ts_put_char(tstring *string, int32_t offset, char byte) {
     CHECK_NULL(string);
@@ -351,7 +360,7 @@ lc_status ts_insert_char(tstring *string, int32_t offset, char byte) {
     return LC_OK;
 }
 
-// `to_end` makes the new text the string's end; otherwise as many characters go as come.
+// Replaces as many characters as `text` has, or with `to_end` everything from the offset on.
 static lc_status write_text(tstring *string, int32_t offset, const char *text, size_t length, bool to_end) {
     CHECK_CONDITION(length <= ts_size_max);
     const auto bytes = static_cast<int32_t>(length);
@@ -451,7 +460,7 @@ lc_status ts_trim_tail(tstring *string, char tail) {
     return ts_trim(string, 0, tail);
 }
 
-// ---- Comparing
+// --- Comparing
 
 int ts_cmp(const tstring *a, const tstring *b) {
     if (!a || !b)

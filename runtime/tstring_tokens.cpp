@@ -1,4 +1,9 @@
-// Splitting a text at its separators, and joining it again: the syntax of names.
+// Splitting a text at separators, and joining the pieces again. mgmt/bnode_names.cpp uses it for the names of
+// nodes.
+//
+// Joining is the inverse of splitting for any tokens, if there is an escape: an escape character in a token
+// is doubled where what follows would otherwise be read as escaped, also when that is the separator after the
+// token.
 #include <cstdlib>
 #include <cstring>
 
@@ -42,9 +47,10 @@ static lc_status add_token(const token_syntax &syntax, tstr_array *tokens, const
 
 static lc_status scan(const token_syntax &syntax, const char *text, tstr_array *tokens) {
     const size_t size = strlen(text);
-    if (size >= ts_size_max) // a token is no longer than a string can be
+    if (size >= ts_size_max) // a token could be longer than a string can be
         FAIL_WITH(LC_ASSERTION);
-    owned_text scratch(static_cast<char *>(malloc(size + 2))); // one more for a closing quote
+    // One byte more, for the closing quote that a text which ends inside quotes gets.
+    owned_text scratch(static_cast<char *>(malloc(size + 2)));
     CHECK_NULL(scratch.pointer);
     size_t length = 0;
     bool quoted = false, behind_separator = false;
@@ -52,6 +58,7 @@ static lc_status scan(const token_syntax &syntax, const char *text, tstr_array *
         const char c = *at;
         behind_separator = false;
         if (syntax.escape && c == syntax.escape && at[1]) {
+            // Before any other character the escape itself is part of the token.
             if (!syntax.escapable(at[1]))
                 scratch.pointer[length++] = c;
             scratch.pointer[length++] = *++at;
@@ -88,7 +95,7 @@ static lc_status tokenize(token_syntax syntax, const char *text, tstr_array **ou
     owned<tstr_array, tstr_array_release> tokens;
     CHECK_STATUS(tstr_array_new(&tokens.pointer, nullptr));
     if (!*text)
-        syntax.flags |= ts_tok_keep_empty; // nothing at all is one empty token
+        syntax.flags |= ts_tok_keep_empty; // an empty text is one empty token
     CHECK_STATUS(scan(syntax, text, tokens.pointer));
     const uint32_t count = tstr_array_length_quick(tokens.pointer);
     const bool empty = count == 0 || (count == 1 && ts_length(tstr_array_get_quick(tokens.pointer, 0)) == 0);
@@ -105,6 +112,7 @@ lc_status ts_tokenize_str_utf8(const char *text, char separator, char escape, ch
     return tokenize({separator, escape, quote, flags, true}, text, out);
 }
 
+// ts_append_char without its checks, while the presized buffer lasts.
 static lc_status push(tstring *string, char c) {
     if (static_cast<uint32_t>(string->length) + 2 > string->size)
         return ts_append_char(string, c);
@@ -114,7 +122,7 @@ static lc_status push(tstring *string, char c) {
     return LC_OK;
 }
 
-// `separated`: a separator follows, so an escape that ends the token has to be doubled.
+// `separated`: a separator follows the token, so an escape at its end has to be doubled.
 static lc_status write_token(const token_syntax &syntax, const tstring *token, bool separated, tstring *out) {
     for (const char *at = token->buffer; *at; at++) {
         const char c = *at;

@@ -10,7 +10,7 @@
 #include "runtime/logging.h"
 #include "runtime/tstring.h"
 
-// How many bytes a character of this lead byte takes; 0 for none.
+// The length of the sequence that this lead byte begins; 0 for a continuation byte.
 static int32_t sequence_length(uint8_t lead) {
     if (lead < 0x80)
         return 1;

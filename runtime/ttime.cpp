@@ -1,5 +1,6 @@
-// Times and their texts. Microseconds are the base: to text the coarser units multiply up to it, from text
-// they divide down from it and refuse what is negative or too large for them.
+// Times and their conversion from and to text. The conversions are written for microseconds. To text, seconds
+// and milliseconds are converted to microseconds first; from text, the result in microseconds is divided,
+// after a check that it is not negative and in range.
 #include "runtime/ttime.h"
 
 #include <cstdio>
@@ -10,10 +11,10 @@ constexpr int64_t US_PER_SEC = 1000000;
 constexpr int64_t US_PER_MS = 1000;
 constexpr int64_t NS_PER_SEC = 1000000000;
 constexpr int64_t NS_PER_MS = 1000000;
-constexpr int64_t SEC_LIMIT_US = 0x7a12000000000;
-constexpr uint32_t TEXT_SIZE = 36;
+constexpr int64_t SEC_LIMIT_US = 0x7a12000000000; // 2^31 seconds
+constexpr uint32_t TEXT_SIZE = 36;                // of the texts that the _to_str forms allocate
 
-// ---- Clocks and records
+// --- Clocks and records
 
 lt_time_us lt_curr_time_us() {
     timeval now{};
@@ -90,7 +91,7 @@ lt_time_ms lt_timeval_to_time_ms(const timeval *value) {
     return int64_t{value->tv_sec} * 1000 + value->tv_usec / US_PER_MS;
 }
 
-// ---- To text
+// --- To text
 
 static lc_status format_time(char *buffer, uint32_t size, size_t at, const char *format, const tm *parts,
                              size_t *out_end) {
@@ -101,8 +102,9 @@ static lc_status format_time(char *buffer, uint32_t size, size_t at, const char 
     return LC_OK;
 }
 
-// The fraction of a second without its leading 0, where it still fits.
+// Appends the fraction of a second as ".250" or ".250125", if there is one and the buffer has room for it.
 static void append_fraction(char *buffer, uint32_t size, size_t *at, int64_t value) {
+    // Also of a negative value the fraction counts forward from the whole second before it.
     const int64_t fraction = ((value % US_PER_SEC) + US_PER_SEC) % US_PER_SEC;
     if (fraction == 0 || *at + 9 > size)
         return;
@@ -113,6 +115,7 @@ static void append_fraction(char *buffer, uint32_t size, size_t *at, int64_t val
     *at += static_cast<size_t>(length) - 1;
 }
 
+// Rounds down, also for negative values.
 static int64_t whole_seconds(int64_t us) {
     return us / US_PER_SEC - (us % US_PER_SEC < 0);
 }
@@ -156,11 +159,13 @@ lc_status lt_dur_us_to_buf(lt_dur_us value, uint32_t size, char *buffer) {
     return LC_OK;
 }
 
-// The coarser units; a value too large for microseconds doesn't fit any text.
+// To microseconds. LC_ASSERTION on overflow.
 static lc_status scaled(int64_t value, int64_t factor, int64_t *out) {
     CHECK_CONDITION(!__builtin_mul_overflow(value, factor, out));
     return LC_OK;
 }
+// Defines lt_daytime_sec_to_buf for example, by way of lt_daytime_us_to_buf. `parameters` and `arguments` are
+// what the functions of a kind take besides the value, in parentheses.
 #define LT_COARSER(kind, unit, type, factor, parameters, arguments)                                          \
     lc_status lt_##kind##_##unit##_to_buf(type value, LT_UNPAREN parameters uint32_t size, char *buffer) {   \
         int64_t us = 0;                                                                                      \
@@ -191,6 +196,7 @@ static lc_status to_str(char **out, Write write) {
 lc_status lt_date_to_str(lt_date value, char **out) {
     return to_str(out, [&](char *text) { return lt_date_to_buf(value, TEXT_SIZE, text, nullptr); });
 }
+// Defines lt_daytime_sec_to_str for example, by way of lt_daytime_sec_to_buf.
 #define LT_TO_STR(name, type, parameters, arguments)                                                         \
     lc_status lt_##name##_to_str(type value, LT_UNPAREN parameters char **out) {                             \
         return to_str(out, [&](char *text) {                                                                 \
@@ -207,10 +213,11 @@ LT_TO_STR(dur_sec, lt_dur_sec, (), ())
 LT_TO_STR(dur_ms, lt_dur_ms, (), ())
 LT_TO_STR(dur_us, lt_dur_us, (), ())
 
-// ---- From text
+// --- From text
 
-// Truncates to microseconds what the text said: most decimal fractions lie a hair beside it as a double, and
-// a text that lt_..._to_str wrote must read back as the value that it was.
+// Truncates to microseconds. Most decimal fractions have no exact representation as a double, so 0.000249
+// would become 248 microseconds; the correction is far below a microsecond, and makes every text that
+// lt_..._to_str writes read back as the same value.
 static int64_t truncated_us(double seconds) {
     const double us = seconds * static_cast<double>(US_PER_SEC);
     return static_cast<int64_t>(us + us * 1e-15);
@@ -239,6 +246,7 @@ static lc_status from_text(const char *text, bool local, lt_time_us *out) {
     int64_t fraction = 0;
     if (!rest || fraction_from_text(rest, &fraction) != LC_OK)
         return LC_BAD_TYPE;
+    // strptime leaves the flag at 0, which would mean "no daylight saving time" to mktime.
     parts.tm_isdst = -1;
     const time_t seconds = local ? mktime(&parts) : timegm(&parts);
     *out = int64_t{seconds} * US_PER_SEC + fraction;
@@ -279,7 +287,8 @@ lc_status lt_str_to_dur_us(const char *text, lt_dur_us *out) {
     double seconds = 0;
     if (sscanf(text, "%lf", &seconds) != 1)
         return LC_BAD_TYPE;
-    if (!(seconds > -9.2e12 && seconds < 9.2e12)) // infinities and what is no number as well
+    // Would overflow as microseconds; the form of the test also refuses infinities and NaN.
+    if (!(seconds > -9.2e12 && seconds < 9.2e12))
         return LC_BAD_TYPE;
     *out = truncated_us(seconds);
     return LC_OK;
@@ -295,6 +304,7 @@ static lc_status to_sec(lt_time_us us, int32_t *out) {
     *out = static_cast<int32_t>(us / US_PER_SEC);
     return LC_OK;
 }
+// Defines lt_str_to_daytime_ms for example, by way of lt_str_to_daytime_us.
 #define LT_FROM_STR(kind, unit, type)                                                                        \
     lc_status lt_str_to_##kind##_##unit(const char *text, type *out) {                                       \
         CHECK_NULL(out);                                                                                     \
@@ -310,7 +320,8 @@ LT_FROM_STR(datetime, sec, lt_time_sec)
 LT_FROM_STR(dur, ms, lt_dur_ms)
 LT_FROM_STR(dur, sec, lt_dur_sec)
 
-// A zone that doesn't exist, then none: the second tzset after localtime cannot take the first for the same.
+// The C library reads the zone file again only when TZ differs from the value that it used last. A file that
+// has changed under the same name is therefore noticed only if TZ has had another value in between.
 lc_status lt_timezone_handle_changed() {
     const lc_status status = lc_setenv("TZ", "error", 1);
     tzset();

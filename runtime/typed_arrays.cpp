@@ -1,3 +1,4 @@
+// The arrays of numbers and of interest records.
 #include "runtime/typed_arrays.h"
 
 #include <cstdlib>
@@ -5,7 +6,7 @@
 
 #include "runtime/fdintrcb.h"
 
-// Numbers lie in the slots themselves and compare as numbers.
+// Numbers are stored in the slots themselves and compared as numbers.
 template <typename Number>
 static int compare_numbers(const void *a, const void *b) {
     const Number left = typed_element<Number>::from_slot(*static_cast<void *const *>(a));
@@ -34,7 +35,7 @@ static int compare_events(const void *a, const void *b) {
         return (left ? 0 : 1) - (right ? 0 : 1);
     return (left->id > right->id) - (left->id < right->id);
 }
-// A newer record takes the place of the one with its id.
+// A newer record replaces the one with its id.
 static void fdic_event_options(array_options *options) {
     options->compare = compare_events;
     options->duplicate = fdic_event_dup_for_array;

@@ -1,11 +1,14 @@
-// Typed covers over `array`. A family is a record that holds an array, and the operations of the list below
-// under the family's name, each forwarding to the array operation of that name:
+// Typed arrays over `array`. A family is a record that holds an array, and the operations below under the
+// family's name, each of which calls the array operation of that name; array.h documents them:
 //
 //   TYPED_ARRAY_DECLARE(tstr_array, tstring *)        in a header
 //   TYPED_ARRAY_DEFINE(tstr_array, tstring *, fill)   in one source; fill(array_options *) sets the functions
 //
-// The element is a pointer or a number of at most a word. _quick forms give no status, and 0 or null on a
-// miss. _takeover forms clear the caller's variable. A null array is LC_NULL.
+// These make tstr_array_append_takeover(tstr_array *list, tstring **inout) for example, whose definition is
+// the line F##_append_takeover below.
+//
+// An element is a pointer, or a number of at most a word. The _quick forms return the value itself, and 0 or
+// null if there is none. The _takeover forms set the caller's variable to null.
 #pragma once
 
 #include <cstdint>
@@ -15,6 +18,8 @@
 
 #include "runtime/array.h"
 
+// Converts an element to and from the word that a slot holds. `given` is the type in which operations take an
+// element that they copy.
 template <typename Element>
 struct typed_element {
     using given = Element;
@@ -36,6 +41,7 @@ struct typed_element<Target *> {
     static void *to_slot(const Target *value) { return const_cast<Target *>(value); }
     static Target *from_slot(void *slot) { return static_cast<Target *>(slot); }
 };
+// Calls an array operation that gives an element, by a slot of its own.
 template <typename Element, typename Call>
 lc_status typed_out(Element *out, Call call) {
     CHECK_NULL(out);
@@ -44,6 +50,8 @@ lc_status typed_out(Element *out, Call call) {
     *out = typed_element<Element>::from_slot(slot);
     return status;
 }
+// Calls an array operation that takes an element over, by a slot of its own; the caller's variable gets what
+// is left in the slot, null after a success.
 template <typename Element, typename Call>
 lc_status typed_takeover(Element *inout, Call call) {
     CHECK_NULL(inout);
@@ -54,6 +62,7 @@ lc_status typed_takeover(Element *inout, Call call) {
 }
 template <typename Family, typename Element>
 using typed_foreach_function = lc_status (*)(Family *list, uint32_t index, Element element, void *data);
+// A foreach function of a family with what it needs, as the user data of the array's foreach.
 template <typename Family, typename Element>
 struct typed_walk {
     typed_foreach_function<Family, Element> function;
@@ -64,7 +73,7 @@ struct typed_walk {
         return walk->function(walk->list, index, typed_element<Element>::from_slot(element), walk->data);
     }
 };
-// The common bodies of new, free and duplicate.
+// What _new, _free and _duplicate have in common.
 template <typename Family>
 lc_status typed_new(Family **out, const array_options *options) {
     CHECK_NULL(out);
@@ -116,7 +125,8 @@ lc_status typed_foreach(Family *list, typed_foreach_function<Family, Element> fu
     return walk_array(list->list, typed_walk<Family, Element>::step, &walk);
 }
 
-// `push` is `append` by another name; `release` frees without a status, for owners of a scope.
+// `push` is another name of `append`. `release` is `free` without a status, for scope guards:
+// owned<tstr_array, tstr_array_release>.
 #define TYPED_ARRAY_DECLARE(F, E)                                                                            \
     struct F {                                                                                               \
         array *list;                                                                                         \
@@ -281,7 +291,8 @@ lc_status typed_foreach(Family *list, typed_foreach_function<Family, Element> fu
         (void)F##_free(&list);                                                                               \
     }
 
-// The families of plain numbers.
+// The families of plain numbers, uint32_array for example. The numbers are stored in the slots and compared
+// as numbers.
 #define TYPED_NUMBER_ARRAYS(X)                                                                               \
     X(uint32_array, uint32_t)                                                                                \
     X(uint64_array, uint64_t)                                                                                \

@@ -1,4 +1,4 @@
-// Alone in its file, so that a new number compiles nothing else again.
+// In a file of its own, so that a new version number recompiles nothing else.
 #include "runtime/version.h"
 
 const char *wccp_version() {
