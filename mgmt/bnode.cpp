@@ -1,6 +1,5 @@
-// Bindings: a name and the attributes of the node.
-//
-// The parts of a name are made when somebody asks for them and kept until the name changes.
+// Bindings: making, copying, changing and reading them. Their arrays are in bnode_array.cpp, attributes in
+// bnode_attrib.cpp and names in bnode_names.cpp.
 #include "mgmt/bnode.h"
 
 #include <cstdlib>
@@ -11,10 +10,11 @@
 #include "runtime/guards.h"
 #include "runtime/logging.h"
 
-// Counts renamings, so that arrays which have found a binding by its name notice.
+// The number of calls of bn_binding_set_name, which tells arrays of bindings that their name index may be
+// outdated.
 std::atomic<uint32_t> bn_binding_renames;
 
-// ---- Life
+// --- Life
 
 lc_status bn_binding_free(bn_binding **inout) {
     CHECK_NULL(inout);
@@ -45,7 +45,7 @@ lc_status bn_binding_new_parts_components_takeover(bn_binding **out, tstring **i
     owned<bn_attrib_array, bn_attrib_array_release> made_attributes;
     if (!name)
         CHECK_NULL(parts);
-    // What another binding's block holds can't leave it.
+    // A name and attributes that are part of another binding's block can't leave it; they are copied.
     if (name && name->placed)
         CHECK_STATUS(ts_dup(name, &made_name.pointer));
     if (attributes && attributes->placed_record)
@@ -136,7 +136,7 @@ lc_status bn_binding_drop_name_parts(bn_binding *binding) {
     return tstr_array_free(&binding->parts);
 }
 
-// ---- Attributes
+// --- Attributes
 
 lc_status bn_binding_set_attrib_takeover(bn_binding *binding, bn_attrib **inout_attrib) {
     CHECK_NULL(binding);
@@ -181,7 +181,7 @@ lc_status bn_binding_new_str_autoinval(bn_binding **out, const char *name, uint3
     return LC_OK;
 }
 
-// ---- Reading
+// --- Reading
 
 static lc_status reach(const bn_binding *binding, uint32_t id, const bn_attrib **out) {
     bn_attrib *attrib = nullptr;

@@ -1,4 +1,4 @@
-// Texts of addresses and prefixes.
+// Conversion of addresses and prefixes from and to text.
 #include <arpa/inet.h>
 
 #include <bit>
@@ -15,7 +15,7 @@ static lc_status text_given(char *text, char **out) {
     return LC_OK;
 }
 
-// ---- Of either family
+// --- IPv4 and IPv6
 
 lc_status bn_text_to_ipaddr(const char *text, lc_ipaddr *out) {
     *out = lc_ipaddr{};
@@ -88,9 +88,9 @@ int lc_ipprefix_compare(const lc_ipprefix *a, const lc_ipprefix *b) {
     return order ? order : a->mask_length - b->mask_length;
 }
 
-// ---- IPv4 as a number in host order
+// --- IPv4, as a number in host order
 
-// Reads four decimal parts; `out_rest` is what follows them.
+// Reads four decimal numbers separated by dots; `out_rest` points to what follows.
 static lc_status read_ipv4(const char *text, uint32_t *out, const char **out_rest) {
     *out = 0;
     for (int part = 0; part < 4; part++) {
@@ -131,6 +131,7 @@ lc_status lc_str_to_ipv4prefix(const char *text, uint64_t *out) {
     if (*rest != '/')
         return LC_BAD_TYPE;
     CHECK_QUIET(bn_text_to_natural(rest + 1, 32, &length));
+    // 64 bits, since shifting 32 bits by 32, for /0, would be undefined.
     const auto mask = static_cast<uint32_t>(UINT64_MAX << (32 - length));
     *out = uint64_t{address} << 32 | mask;
     return LC_OK;
@@ -149,9 +150,10 @@ lc_status lc_ipv4prefix_to_str(uint64_t value, char **out) {
                       out);
 }
 
-// ---- Hardware addresses
+// --- Hardware addresses
 
-// A group of one or two digits is one byte, of three or four two bytes; six bytes in all.
+// "00:11:22:33:44:55", or with groups of two bytes "0011:2233:4455": a group of up to two digits is one byte,
+// a longer one two; there must be six bytes.
 lc_status lc_str_to_macaddr802(const char *text, lc_macaddr802 *out) {
     CHECK_NULL(out);
     *out = lc_macaddr802{};

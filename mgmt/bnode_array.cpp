@@ -1,9 +1,10 @@
-// Arrays of bindings, and finding bindings in them.
+// Arrays of bindings, and searching them by name and by pattern.
 //
-// A start reads thousands of bindings and looks most of them up by name, once for each group and field. A
-// sorted array is searched by halves; a large unsorted one gets an index of names (array_index.h) at the
-// first search. A pattern that begins with literal text is matched only against the names that begin with it;
-// in an unsorted array each other name costs one comparison.
+// When wccpd starts, it reads thousands of bindings and looks most of them up by name, one by one for each
+// field of each group. A sorted array is searched by bisection; a large unsorted one gets a hash index of the
+// names (array_index.h) with the first search. A pattern usually begins with literal parts. Only names that
+// begin with the same text are compared with the pattern; in a sorted array they are found by bisection, in
+// an unsorted one the others cost one strncmp each.
 #include <algorithm>
 #include <cstring>
 
@@ -48,7 +49,7 @@ lc_status bn_binding_array_new_sized(bn_binding_array **out, uint32_t count) {
     return bn_binding_array_new_full(out, &options);
 }
 
-// ---- By name
+// --- By name
 
 lc_status bn_binding_array_get_index_by_name(const bn_binding_array *array, const char *name,
                                              int32_t *out_index) {
@@ -56,6 +57,7 @@ lc_status bn_binding_array_get_index_by_name(const bn_binding_array *array, cons
     *out_index = -1;
     CHECK_NULL(array);
     CHECK_NULL(name);
+    // A key on the stack, so that nothing is allocated for a search.
     tstring key_name{};
     key_name.buffer = const_cast<char *>(name);
     key_name.length = key_name.characters = static_cast<int32_t>(strlen(name));
@@ -103,7 +105,8 @@ lc_status bn_binding_array_get_value_tstr_by_name(const bn_binding_array *array,
 }
 
 namespace {
-// "prefix/relative", on the stack where it fits.
+// "prefix/relative", in a buffer on the stack if it fits. `text` is null without memory or with a null
+// argument.
 struct relative_name {
     char buffer[256];
     char *heap = nullptr;
@@ -140,10 +143,10 @@ lc_status bn_binding_array_get_value_tstr_by_name_rel(const bn_binding_array *ar
     return bn_binding_array_get_value_tstr_by_name(array, name.text, out_type_and_flags, out);
 }
 
-// ---- By pattern
+// --- By pattern
 
 namespace {
-// One walk over the names that can match, in order.
+// The state of a search for the names that match a pattern, in the order of the array.
 struct pattern_walk {
     const bn_binding_array *array = nullptr;
     bn_pattern pattern;
@@ -164,7 +167,8 @@ static lc_status begin_walk(pattern_walk *walk, const bn_binding_array *array, c
     walk->in_order = narrowed && array->list->sorted;
     if (!walk->in_order)
         return LC_OK;
-    uint32_t low = 0, high = array->list->length; // the first name that is not below the start
+    uint32_t low = 0,
+             high = array->list->length; // searches the first name that isn't less than the literal text
     while (low < high) {
         const uint32_t middle = low + (high - low) / 2;
         const bn_binding *binding = bn_binding_array_get_quick(array, middle);
@@ -184,11 +188,12 @@ static const bn_binding *next_match(pattern_walk *walk, uint32_t *out_index) {
         if (!binding)
             continue;
         const char *name = binding->name->buffer;
+        // Less than, equal to or greater than 0: how the start of the name compares with the literal text.
         const int beside = walk->start.pointer ? strncmp(name, walk->start.pointer->buffer,
                                                          static_cast<size_t>(walk->start.pointer->length))
                                                : 0;
         if (walk->in_order && beside > 0)
-            return nullptr;
+            return nullptr; // all further names are greater as well
         if (beside != 0)
             continue;
         if (!bn_pattern_matches(&walk->pattern, name))

@@ -1,4 +1,5 @@
-// Attributes: one typed value each. Everything that depends on the type comes from the type's row.
+// Attributes: one typed value each. Everything that depends on the type is looked up in the type's row
+// (bnode_rows.h).
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
@@ -100,9 +101,9 @@ lc_status bn_attrib_compare(const bn_attrib *a, const bn_attrib *b, int *out_res
     return LC_OK;
 }
 
-// ---- Setting
+// --- Setting
 
-// A new value of this type comes; the old one goes.
+// Frees the old value and sets everything but the new one.
 static void begin(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags) {
     (void)bn_attrib_free_value(attrib);
     attrib->attribute_id = id;
@@ -120,12 +121,14 @@ static lc_status set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uint32
     attrib->value_size = size;
     return LC_OK;
 }
-// The attribute is changed when the text has become a value, and keeps its old one otherwise.
+// The conversion writes to a temporary attribute, so that the old value survives a text that can't be
+// converted.
 lc_status bn_attrib_set_str(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags, const char *text) {
     CHECK_NULL(attrib);
     CHECK_CONDITION(bn_attrib_id_valid(id));
     const bn_type_row *row = bn_type_find(type);
     CHECK_CONDITION(row && type <= BN_TYPE_LAST);
+    // The absent mark leaves the size at 0; for the invalid mark it is the type's.
     if ((flags & bn_flag_no_value) || type == bn_type_none) {
         begin(attrib, id, type, flags);
         if (!(flags & bn_flag_absent))
@@ -162,7 +165,7 @@ lc_status bn_attrib_new_str(bn_attrib **out, uint32_t id, uint32_t type, uint32_
     return LC_OK;
 }
 
-// ---- Getting
+// --- Getting
 
 static void tell(const bn_attrib *attrib, uint32_t *out_id, uint32_t *out_type_and_flags) {
     if (out_id)
@@ -209,7 +212,7 @@ lc_status bn_attrib_get_tbuf_const(const bn_attrib *attrib, uint32_t *out_id, ui
     return LC_OK;
 }
 
-// ---- The typed operations
+// --- The typed operations
 
 static lc_status read_fixed(const bn_attrib *attrib, uint32_t type, uint32_t *out_id,
                             uint32_t *out_type_and_flags, void *value, uint32_t size) {
@@ -225,7 +228,7 @@ static lc_status read_fixed(const bn_attrib *attrib, uint32_t type, uint32_t *ou
     return LC_OK;
 }
 
-// The attribute in the slot; null for an empty one.
+// The attribute in a slot of a binding; null if the slot is empty.
 static lc_status slot_of(const bn_binding *binding, uint32_t id, uint32_t *out_type_and_flags,
                          bn_attrib **out) {
     *out = nullptr;
@@ -288,6 +291,9 @@ static const Value *bn_at(const Value &value) {
     return &value;
 }
 
+// Defines bn_attrib_set_uint32, bn_attrib_new_uint32, bn_attrib_get_uint32, bn_binding_set_uint32,
+// bn_binding_new_uint32 and bn_binding_get_uint32, and the same for the other types of BN_VALUE_TYPES. The
+// arguments are a row of that table.
 #define BN_DEFINE_TYPED(name, number, type, in, in_place, outs, give)                                        \
     lc_status bn_attrib_set_##name(bn_attrib *attrib, uint32_t id, uint32_t flags, BN_UNPAREN in) {          \
         return set_fixed(attrib, id, number, flags, in_place, sizeof(type));                                 \

@@ -1,5 +1,5 @@
-// The attributes of a node. To its users this is an array whose index is the attribute id; only the slots
-// that are filled take memory, since a peer chooses the ids and most nodes have their value and nothing else.
+// The attributes of a binding. The interface is that of an array indexed by attribute id, but only filled
+// slots take memory, since a peer chooses the ids of a message, and most bindings have one attribute.
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
@@ -8,7 +8,7 @@
 #include "mgmt/bnode_block.h"
 #include "runtime/guards.h"
 
-// The first filled slot at or above `id`.
+// The index of the first filled slot whose id is not less than `id`.
 static uint32_t place_of(const bn_attrib_array *array, uint32_t id) {
     uint32_t at = 0;
     while (at < array->count && array->slots[at].id < id)
@@ -105,6 +105,7 @@ static lc_status put(bn_attrib_array *array, uint32_t id, bn_attrib *attrib, boo
     const uint32_t at = place_of(array, id);
     const bool filled = at < array->count && array->slots[at].id == id;
     bn_attrib_slot *end = array->slots + array->count;
+    // The same object again: freeing the old one would free it.
     if (filled && array->slots[at].attrib == attrib)
         return LC_OK;
     if (filled)

@@ -1,9 +1,18 @@
-// The bytes of an attribute on the wire: 16 bytes of kind, id, type and flags, then what the type's family
-// says. All numbers are big-endian; an address counts as one number of 128 bits, so its bytes are reversed.
+// The wire form of attributes. All numbers are big-endian.
 //
-// What comes from a peer is checked before anything is made of it: the id has to be a valid one, the size
-// that of the type, the length within the buffer, and no NUL inside a text. An attribute marked invalid or
-// absent has no value; whatever is in its place is skipped.
+//   offset  size
+//        0     4  kind: 1 number or address, 2 bytes of fixed size, 4 text or bytes with a length
+//        4     4  attribute id
+//        8     4  type
+//       12     4  type flags, low 16 bits 0
+//       16     4  size or length of the value, followed by the value
+//
+// Only ipaddr and ipprefix have no size: at offset 16 they have the family, in ipprefix the mask length, and
+// the address. An address is sent as one number of 128 bits, that is with its bytes reversed.
+//
+// What a peer sends is checked before any memory is allocated for it: the id must be valid, the size that of
+// the type, the length within the buffer, and a text must not contain a NUL. An attribute that is marked
+// invalid or absent has no value; the bytes in its place are skipped.
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
@@ -24,8 +33,8 @@ static bool has_value(uint32_t flags) {
     return !(flags & bn_flag_no_value);
 }
 
-// Stored bytes to wire bytes and back: numbers and addresses are turned around, a mask length after an
-// address keeps its place.
+// Converts between stored bytes (little-endian) and wire bytes by reversing them. The mask length that
+// follows the address in an ipv6prefix stays in its place.
 static void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
     static_assert(std::endian::native == std::endian::little);
     const uint32_t turned = std::min(size, ADDRESS_SIZE);
@@ -33,12 +42,12 @@ static void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
     memcpy(to + turned, from + turned, size - turned);
 }
 
-// ---- Writing
+// --- Writing
 
 static lc_status put_number(tbuffer *buffer, uint32_t offset, uint32_t value) {
     return tb_put_uint32(buffer, offset, raw_word(to_be32(value)));
 }
-// Both give the bytes that they wrote.
+// This and put_value write to the buffer and return the number of bytes written in `out`.
 static lc_status put_sized(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t size,
                            uint32_t *out) {
     CHECK_STATUS(put_number(buffer, offset, size));
@@ -101,7 +110,7 @@ lc_status bn_attrib_append_wire(const bn_attrib *attrib, tbuffer *buffer) {
     return LC_OK;
 }
 
-// ---- Reading
+// --- Reading
 
 static uint32_t number_at(const uint8_t *bytes) {
     be32 wire;
@@ -124,7 +133,8 @@ static lc_status check_type(uint32_t found, uint32_t expected) {
            lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(expected)));
     return LC_GENERIC;
 }
-// `at` is where the family's part begins, with `rest` bytes from there on.
+// Locates the value. `at` is what follows the 16 bytes of the head, and `rest` the number of bytes from there
+// to the end of the buffer.
 static lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t rest) {
     const bn_type_row *row = out->row;
     if (row->wire.leading) {
@@ -144,6 +154,7 @@ static lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t r
             CHECK_QUIET(bn_check_text(out->value, out->length));
         return LC_OK;
     }
+    // An absent value may have its fixed size or none.
     if (out->length != row->size && !(out->length == 0 && (out->flags & bn_flag_absent)))
         FAIL_WITH(LC_GENERIC);
     CHECK_CONDITION(out->length <= rest);
@@ -188,7 +199,7 @@ static void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
         memcpy(out->value.bytes, found->value, found->length);
     }
 }
-// A peer's text that isn't UTF-8 after all is reported in the log and stays a plain text.
+// A text of type utf8_string that isn't valid UTF-8 is logged and kept, without the mark.
 static void mark_utf8(bn_attrib *attrib) {
     if (attrib->type == bn_type_utf8_string)
         LOG_STATUS(ts_set_utf8(attrib->value.string, 1));
@@ -217,6 +228,7 @@ static lc_status take_copy(const bn_wire_attrib *found, bn_attrib *attrib) {
         mark_utf8(attrib);
         return LC_OK;
     }
+    // tb_new_takeover may enlarge the memory, which is why it is freed here only after a failure.
     auto *taken = reinterpret_cast<uint8_t *>(bytes.take());
     const lc_status status = tb_new_takeover(&attrib->value.binary, &taken, found->length, found->length);
     free(taken);

@@ -1,3 +1,6 @@
+// Blocks. The memory begins with the reference count, followed by the records, each aligned to 8 bytes, and
+// then by the texts, which need no alignment. A placed binding finds its block by its distance from the
+// start, in units of 8 bytes.
 #include "mgmt/bnode_block.h"
 
 #include <atomic>
@@ -7,7 +10,6 @@
 
 #include "mgmt/bnode_rows.h"
 
-// Records follow, then texts.
 struct bn_block {
     std::atomic<uint32_t> holders;
 };
@@ -22,7 +24,7 @@ void bn_block_release(bn_block *block) {
         free(block);
 }
 
-// ---- Adding up
+// --- Sizes
 
 void bn_size_record(bn_block_size *size, size_t bytes) {
     size->records += in_grains(bytes);
@@ -71,7 +73,7 @@ void bn_size_copy(bn_block_size *size, const bn_binding *binding) {
     }
 }
 
-// ---- Placing
+// --- Placing
 
 lc_status bn_block_new(const bn_block_size *size, bn_block_builder *out) {
     auto *memory = static_cast<uint8_t *>(malloc(HEAD + size->records + size->texts));
@@ -112,6 +114,7 @@ lc_status bn_place_string(bn_block_builder *builder, const char *bytes, size_t l
 static lc_status place_bare(bn_block_builder *builder, size_t length, tstring **out) {
     tstring **shared = &builder->bare[length];
     if (!*shared)
+        // Of length 0 or 1.
         CHECK_QUIET(bn_place_string(builder, "/", length, shared));
     *out = *shared;
     return LC_OK;
@@ -151,7 +154,7 @@ lc_status bn_place_binding(bn_block_builder *builder, size_t name_length, bool b
     const ptrdiff_t distance = reinterpret_cast<uint8_t *>(binding) - reinterpret_cast<uint8_t *>(block);
     binding->block_distance = static_cast<uint32_t>(static_cast<size_t>(distance) / GRAIN);
     const uint32_t holders = block->holders.load(std::memory_order_relaxed);
-    block->holders.store(holders + 1, std::memory_order_relaxed); // nobody else has the block yet
+    block->holders.store(holders + 1, std::memory_order_relaxed); // only its maker has the block so far
     *out = binding;
     return LC_OK;
 }
@@ -197,6 +200,7 @@ lc_status bn_place_copy(bn_block_builder *builder, const bn_binding *binding, bn
         CHECK_QUIET(bn_attrib_array_put_placed(copy.pointer->attributes, binding->attributes->slots[i].id,
                                                &attribs[i]));
     }
+    // The highest id may be greater than the last filled slot, if that has been emptied.
     if (count)
         copy.pointer->attributes->length = binding->attributes->length;
     else if (binding->attributes)

@@ -1,5 +1,6 @@
-// Names and patterns of names. An array of bindings is matched against a pattern name by name, so the match
-// of a text walks it in place: nothing is allocated for a name that doesn't match.
+// Names and patterns. A search compares a pattern with each name of an array, so bn_pattern_matches works on
+// the text of the name directly and allocates nothing. tstr_array_wildcard_match does the same on parts; the
+// two must agree, which a test checks for all short names and patterns.
 #include "mgmt/bnode_names.h"
 
 #include <cstdlib>
@@ -14,7 +15,7 @@ const char *bn_part_end(const char *part) {
         part += bn_escapes(part);
     return part;
 }
-// Copies a part without its escapes, with a NUL after it.
+// Copies a part without its escapes, and adds a NUL. Returns the number of characters.
 static uint32_t copy_part(const char *part, const char *end, char *out) {
     char *at = out;
     for (; part < end; part++) {
@@ -24,6 +25,7 @@ static uint32_t copy_part(const char *part, const char *end, char *out) {
     *at = 0;
     return static_cast<uint32_t>(at - out);
 }
+// The number of parts of a name, without a leading separator; at least 1.
 static uint32_t parts_from(const char *name) {
     uint32_t count = 1;
     for (name = bn_part_end(name); *name; name = bn_part_end(name + 1))
@@ -40,6 +42,8 @@ lc_status bn_binding_name_to_parts(const char *name, tstr_array **out_parts, int
     const char *part = name + absolute;
     if (!*part)
         return tstr_array_new(out_parts, nullptr);
+    // Each part takes its length and a NUL, where the name has its length and a separator: at most as much in
+    // all.
     const size_t length = strlen(part);
     CHECK_CONDITION(length < ts_size_max);
     const uint32_t count = parts_from(part);
@@ -68,7 +72,7 @@ lc_status bn_binding_name_parts_to_name(const tstr_array *parts, int absolute, c
     return LC_OK;
 }
 
-// ---- Patterns
+// --- Patterns
 
 lc_status bn_pattern_init(bn_pattern *pattern, const char *text) {
     CHECK_STATUS(bn_binding_name_to_parts(text, &pattern->parts, &pattern->absolute));
@@ -101,6 +105,7 @@ bool bn_pattern_matches(const bn_pattern *pattern, const char *name) {
     for (uint32_t i = 0; i < wanted_count; i++) {
         const tstring *wanted = tstr_array_get_quick(pattern->parts, i);
         const char *end = bn_part_end(name);
+        // "**" matches the rest, if that has at least as many parts as the rest of the pattern.
         if (!part_equals(name, end, wanted) && !is_text(wanted, "*"))
             return is_text(wanted, "**") && wanted_count - i <= parts_from(name);
         if (!*end)
@@ -116,6 +121,7 @@ bool bn_pattern_literal_start(const bn_pattern *pattern, tstring **out) {
         return false;
     for (uint32_t i = 0; i < tstr_array_length_quick(pattern->parts); i++) {
         const tstring *part = tstr_array_get_quick(pattern->parts, i);
+        // A part with a wildcard, or one that is written with escapes in a name, ends the literal text.
         if (strpbrk(part->buffer, "*\\/"))
             break;
         if (i > 0 && ts_append_char(start.pointer, SEPARATOR) != LC_OK)

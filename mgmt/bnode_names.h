@@ -1,4 +1,4 @@
-// Patterns split once and matched against many names.
+// Patterns that are split once and matched with many names. For mgmt/bnode_*.cpp only.
 #pragma once
 
 #include "mgmt/bnode.h"
@@ -12,16 +12,19 @@ struct bn_pattern {
     ~bn_pattern();
 };
 lc_status bn_pattern_init(bn_pattern *pattern, const char *text);
-// As splitting the name and tstr_array_wildcard_match.
+// The same result as splitting the name and calling tstr_array_wildcard_match, but without allocating
+// anything.
 bool bn_pattern_matches(const bn_pattern *pattern, const char *name);
-// What every matching name begins with. False without memory.
+// The literal text that every matching name begins with, for the caller to free. False if there is no memory
+// for it.
 bool bn_pattern_literal_start(const bn_pattern *pattern, tstring **out);
 
-// The end of the part that begins at `part`: a separator or the end of the name.
+// The separator that ends the part which begins at `part`, or the end of the name.
 const char *bn_part_end(const char *part);
-// Whether a backslash here escapes the next character.
+// Whether `at` is a backslash that escapes the next character.
 inline bool bn_escapes(const char *at) {
     return at[0] == '\\' && (at[1] == '\\' || at[1] == '/');
 }
 
+// The number of calls of bn_binding_set_name, see bn_binding.cpp.
 extern std::atomic<uint32_t> bn_binding_renames;

@@ -1,6 +1,10 @@
-// Messages in memory: requests and responses are made, filled, read and freed here, and nothing of them is
-// kept anywhere else. bnode_proto_wire.cpp turns them into bytes and back, bnode_proto_session.cpp sends
+// Messages in memory: making, filling, reading and freeing requests and responses. bnode_proto_wire.cpp
+// converts them to bytes and back, bnode_proto_session.cpp sends and receives them, bnode_proto_dump.cpp logs
 // them.
+//
+// The nodes of a message that was built here are allocated one by one. Those of a received message, and all
+// copies, are in one block (bnode_block.h). The same functions work on both: a node knows whether it is part
+// of a block.
 #include "mgmt/bnode_proto.h"
 
 #include <cstdlib>
@@ -54,7 +58,7 @@ uint16_t bn_request_msg_response_msg_type(uint16_t request_type) {
     }
 }
 
-// ---- Nodes
+// --- Nodes
 
 void bn_request_node_free(bn_request_node *node) {
     if (!node)
@@ -88,7 +92,7 @@ static void fill_response_nodes(array_options *options) {
 TYPED_ARRAY_DEFINE(bn_request_per_node_array, bn_request_node *, fill_request_nodes)
 TYPED_ARRAY_DEFINE(bn_response_per_node_array, bn_response_node *, fill_response_nodes)
 
-// Options for an array that is going to have `count` elements.
+// Options for an array that will have `count` elements.
 static array_options options_for(uint32_t count, void (*fill)(array_options *)) {
     array_options options = {};
     (void)array_options_get_defaults(&options);
@@ -105,7 +109,7 @@ lc_status bn_response_nodes_new(bn_response_per_node_array **out, uint32_t count
     return bn_response_per_node_array_new_full(out, &options);
 }
 
-// ---- Requests
+// --- Requests
 
 lc_status bn_request_msg_free(bn_request_msg **inout) {
     if (!inout || !*inout)
@@ -198,7 +202,7 @@ lc_status bn_query_request_msg_append_str(bn_request_msg *msg, uint32_t subop, u
     return LC_OK;
 }
 
-// An attribute without a value for each one that is asked for.
+// Adds an attribute without a value for each of these ids.
 static lc_status ask_for_attributes(bn_binding *binding, const bn_attrib_array *attributes) {
     const uint32_t count = bn_attrib_array_length_quick(attributes);
     for (uint32_t id = 0; id < count; id++)
@@ -296,7 +300,7 @@ lc_status bn_request_set_transaction_id(bn_request_msg *msg, uint32_t transactio
     return LC_OK;
 }
 
-// ---- Responses
+// --- Responses
 
 lc_status bn_response_msg_free(bn_response_msg **inout) {
     if (!inout || !*inout)
@@ -409,14 +413,14 @@ lc_status bn_response_msg_dup(const bn_response_msg *msg, bn_response_msg **out)
     return LC_OK;
 }
 
-// ---- Reading
+// --- Reading
 
 int32_t bn_request_get_msg_id(const bn_request_msg *msg) {
     return msg ? static_cast<int32_t>(msg->msg_id) : -1;
 }
 
-// Parts that the reader asked for are made now, from the name that has them all; the others go. A name of no
-// parts has none to make.
+// Makes the parts of a name if the reader wants them, otherwise drops them. A name that has none ("" or "/")
+// gets none.
 static lc_status settle_parts(bn_binding *binding, int keep_parts) {
     if (!keep_parts)
         return bn_binding_drop_name_parts(binding);
@@ -427,7 +431,7 @@ static lc_status settle_parts(bn_binding *binding, int keep_parts) {
 }
 
 namespace {
-// Bindings on their way to a reader, with the ids of their nodes.
+// What is read from a message: bindings, and the ids of their nodes.
 struct reading {
     owned_bindings bindings;
     owned_uint32_array ids;

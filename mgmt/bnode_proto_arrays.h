@@ -1,10 +1,10 @@
-// The nodes of messages, as arrays: inside the message code only.
+// The arrays of a message's nodes, for mgmt/bnode_proto*.cpp only.
 #pragma once
 
 #include "mgmt/bnode_proto.h"
 #include "mgmt/owners.h"
 
-// Messages without the array of their nodes, and arrays with room for so many.
+// Messages whose array of nodes is still missing, and arrays with room for `count` nodes.
 lc_status bn_request_msg_new(bn_request_msg **out, uint16_t type);
 lc_status bn_response_msg_new(bn_response_msg **out, uint16_t type);
 lc_status bn_request_nodes_new(bn_request_per_node_array **out, uint32_t count);

@@ -1,4 +1,5 @@
-// What is sent, as text in the log at debug level: headers, names, and the first nodes with their values.
+// Logs messages at debug level: their headers and names, and the first nodes with their values. Only messages
+// that are sent are logged; the receive path passes the level -1.
 #include "mgmt/bnode_proto.h"
 #include "mgmt/owners.h"
 #include "runtime/logging.h"
@@ -10,7 +11,7 @@ struct dump_target {
     int32_t level;
     const char *title;
 };
-// Between the title and the service: " local" and " peer", each only when there is one.
+// The names of the session's ends, each with the blank before it, or empty.
 struct dump_names {
     const char *local_gap, *local, *peer_gap, *peer;
 };

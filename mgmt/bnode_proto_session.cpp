@@ -1,10 +1,11 @@
-// Messages over a session: protocol 2 with its state per instance and per session, sending, and dispatching
-// received frames to the callback of their type.
+// Messages on a session: body protocol 2, "bnode". It sends messages and passes received ones to the callback
+// of their type. Its state is a record per instance (message ids, default callbacks) and one per session
+// (service, callbacks).
 //
-// Everything here runs with the instance's and the session's locks held, in that order; both are recursive. A
-// callback may send on its own session, and may wait for an answer by running the loop again, in which case
-// further messages of the session are received inside it. The message is freed when its callback returns, and
-// nothing else of the session is touched after that.
+// Everything here runs with the locks of the instance and of the session held, taken in that order; both are
+// recursive. A callback may send on its session. It may also wait for an answer by running the loop, and then
+// further messages of the session are received inside it, or the session is closed or freed. After a callback
+// has returned, only the message is freed, and the session is not used any more.
 #include <cstdlib>
 #include <cstring>
 
@@ -21,14 +22,14 @@ struct bn_callback {
 };
 constexpr uint16_t MSG_TYPES = bn_msg_event_ack + 1;
 
-// One for the instance.
+// One per instance.
 struct bn_instance_state {
     uint32_t next_msg_id;
     uint32_t transactions;
     tstring *audit_user;
     bn_callback callbacks[MSG_TYPES];
 };
-// One for each session.
+// One per session.
 struct bn_session_state {
     uint16_t service; // the session's bnode service, 0 until it is known
     bn_callback callbacks[MSG_TYPES];
@@ -43,7 +44,7 @@ static bn_session_state *session_state(gcl_session *session) {
     return static_cast<bn_session_state *>(gcl_session_get_protocol_state(session, BN_PROTO));
 }
 
-// ---- Callbacks
+// --- Callbacks
 
 static lc_status set_global(gcl *instance, uint16_t type, bn_callback callback) {
     CHECK_NULL(instance);
@@ -61,6 +62,7 @@ static lc_status set_session(gcl_session *session, uint16_t type, bn_callback ca
     return LC_OK;
 }
 
+// Define bn_set_global_callback_query_request_msg, bn_set_session_callback_query_request_msg and so on.
 #define BN_REQUEST_SETTERS(kind, type)                                                                       \
     lc_status bn_set_global_callback_##kind##_msg(gcl *instance, bn_request_callback callback, void *data) { \
         return set_global(instance, type, {callback, nullptr, data});                                        \
@@ -87,9 +89,9 @@ BN_RESPONSE_SETTERS(action_response, bn_msg_action_response)
 BN_REQUEST_SETTERS(event_request, bn_msg_event)
 BN_RESPONSE_SETTERS(event_response, bn_msg_event_ack)
 
-// ---- Sending
+// --- Sending
 
-// The service that the session speaks: its bnode service, or else the one that the opening brought.
+// The service id of messages, which is the service that was opened last before the first message was sent.
 static uint16_t service_of(gcl_session *session) {
     bn_session_state *state = session_state(session);
     if (!state)
@@ -99,7 +101,7 @@ static uint16_t service_of(gcl_session *session) {
     return state->service;
 }
 
-// Message and transaction ids, as both kinds of message get them.
+// Sets the message id, and the service and transaction id if they aren't set.
 template <typename Message>
 static lc_status number_message(gcl_session *session, Message *msg) {
     bn_instance_state *state = instance_state(gcl_session_get_instance(session));
@@ -162,12 +164,12 @@ static lc_status send_message(gcl_session *session, Message *msg) {
     const lc_status status = gcl_session_send_frame_components_tb(session, BN_PROTO, msg->msg_type,
                                                                   BN_FRAME_HEADER_BYTES, &buffer.pointer);
     if (status == LC_NO_BUFFER_SPACE)
-        CHECK_QUIET(status); // larger than a frame, which has its line
+        CHECK_QUIET(status); // larger than a frame, which has been logged
     CHECK_STATUS(status);
     return LC_OK;
 }
 
-// Instead of an answer that did not fit: a peer that hears nothing would wait until its time is over.
+// Replaces a response that doesn't fit. Without any response the peer would wait until its timeout.
 static lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, lc_status reason) {
     owned_response refusal;
     CHECK_STATUS(bn_response_msg_create(&refusal.pointer, msg->msg_type, msg->response_to, LC_NO_BUFFER_SPACE,
@@ -189,22 +191,23 @@ lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg) {
 }
 lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg) {
     CHECK_NULL(session);
-    const gcl_session_guard guard(session); // nothing gets between an answer and its refusal
+    // Held throughout, so that no other thread sends between the attempt and the refusal.
+    const gcl_session_guard guard(session);
     const lc_status status = send_message<response_kind>(session, msg);
     if (status != LC_NO_BUFFER_SPACE && status != LC_CANCELLED)
         return status;
     return send_refusal(session, msg, status);
 }
 
-// ---- Receiving
+// --- Receiving
 
 static const char *const kind_words[] = {"query", "set", "action", "event"};
 static const char *kind_word(uint16_t type) {
     return kind_words[(type - 1) / 2];
 }
 
-// The frame's type says how the body is read; the callback is that of the message's own type. False, with a
-// line, when one of them is no type at all.
+// The type in the frame header decides whether the body is a request or a response; the type in the message
+// decides which callback is called. False, logged, if one of them is not a message type.
 static bool check_types(gcl_session *session, uint16_t mtype, uint16_t msg_type) {
     for (const uint16_t type : {mtype, msg_type}) {
         if (type >= bn_msg_query_request && type <= bn_msg_event_ack)
@@ -219,6 +222,7 @@ static bool check_types(gcl_session *session, uint16_t mtype, uint16_t msg_type)
 static lc_status receive_request(gcl_session *session, uint16_t mtype, tbuffer **inout_frame) {
     owned_request msg;
     CHECK_STATUS(bn_request_msg_deserialize(*inout_frame, BN_FRAME_HEADER_BYTES, &msg.pointer));
+    // The callback may run the loop for long; the frame's memory isn't needed any more.
     bn_request_msg_dump(session, msg.pointer, -1, "RECV REQ");
     (void)tb_free(inout_frame);
     const uint16_t type = msg.pointer->msg_type;
@@ -226,6 +230,7 @@ static lc_status receive_request(gcl_session *session, uint16_t mtype, tbuffer *
         return LC_OK;
     const bn_session_state *state = session_state(session);
     CHECK_NULL(state);
+    // A copy: the callback may free the session, and the state with it.
     const bn_callback callback = state->callbacks[type];
     if (!callback.request) {
         LC_LOG(LC_LOG_WARNING, "session %d: proto bnode: no %s request callback", gcl_session_get_id(session),
@@ -240,6 +245,7 @@ static lc_status receive_response(gcl_session *session, uint16_t mtype, tbuffer 
     constexpr int32_t HEADER_BYTES = 20;
     const int32_t id = gcl_session_get_id(session);
     CHECK_CONDITION(tb_length(*inout_frame) >= static_cast<int32_t>(BN_FRAME_HEADER_BYTES) + HEADER_BYTES);
+    // The service is checked before anything is read, so that a message for another service costs nothing.
     be16 wire_service = {};
     memcpy(wire_service.bytes, tb_buf(*inout_frame) + BN_FRAME_HEADER_BYTES, sizeof wire_service);
     const uint16_t service = to_host(wire_service);
@@ -286,7 +292,7 @@ static lc_status receive_frame(gcl_session *session, gcl_body_protocol *protocol
     return LC_OK;
 }
 
-// ---- The protocol
+// --- The protocol
 
 static lc_status session_new(gcl_session *session, gcl_body_protocol *protocol) {
     const bn_instance_state *shared = static_cast<const bn_instance_state *>(protocol->state);

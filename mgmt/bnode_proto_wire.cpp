@@ -1,8 +1,16 @@
-// Messages on the wire. All integers are big-endian; a string is a 4-byte length and that many bytes.
+// Messages on the wire. All integers are big-endian; a string is a 4-byte length and that many bytes, without
+// a NUL.
+//
+//   header (below); request: audit user, string; response: return code, and return message, string
+//   node count, then for each node: id; absolute, 1 byte; number of name parts; each part as a string,
+//   without escapes;
+//     number of attributes; each attribute (bnode_attrib_wire.cpp); node trailer by message type
+//   message trailer by message type
 //
 // A received message is read twice. The first pass checks every field against the bytes received and adds up
-// the memory that the nodes need. That is then allocated at once, and the second pass fills it. A peer cannot
-// make a node take more than eight times its bytes on the wire.
+// the memory that the nodes need; the second pass fills a block (bnode_block.h) of that size. Both passes
+// read with the same functions, so they can't disagree. A message with a false count or length is refused
+// before anything is allocated for it. A node takes at most eight times its bytes on the wire.
 #include <cstdlib>
 #include <cstring>
 
@@ -15,7 +23,7 @@
 #include "runtime/logging.h"
 
 namespace {
-// The fixed parts, where their bytes lie.
+// The headers, which follow the frame header.
 struct bn_wire_request_header {
     be16 service_id;
     be16 msg_type;
@@ -61,7 +69,7 @@ static void bn_byte_swap_response_header(const bn_wire_response_header *wire, bn
     msg->response_to = to_host(wire->response_to);
 }
 
-// ---- Writing
+// --- Writing
 
 static lc_status put_u32(tbuffer *buffer, uint32_t value) {
     const be32 wire = to_be32(value);
@@ -84,7 +92,7 @@ static uint32_t used(const tbuffer *buffer) {
     return static_cast<uint32_t>(tb_length(buffer));
 }
 
-// A part of a name, without its escapes.
+// Writes one part of a name without its escapes, in runs of bytes that need no change.
 static lc_status put_escaped_part(tbuffer *buffer, const char *part, const char *end) {
     const uint32_t length_at = used(buffer);
     CHECK_STATUS(put_u32(buffer, 0));
@@ -98,7 +106,8 @@ static lc_status put_escaped_part(tbuffer *buffer, const char *part, const char 
     CHECK_STATUS(put_u32_at(buffer, length_at, used(buffer) - length_at - 4));
     return LC_OK;
 }
-// Every message writes a name for each of its bindings, so the parts are taken out of the text in place.
+// Splits the name while it writes it, since making an array of parts for each binding of a message would be
+// slow.
 static lc_status put_name_text(tbuffer *buffer, const char *name) {
     const bool absolute = *name == '/';
     CHECK_STATUS(tb_append_uint8(buffer, absolute));
@@ -106,6 +115,8 @@ static lc_status put_name_text(tbuffer *buffer, const char *name) {
     CHECK_STATUS(put_u32(buffer, 0));
     const char *part = name + absolute;
     uint32_t count = 0;
+    // `*part || count`: an empty name has no parts, but a name that ends with a separator has an empty last
+    // one.
     for (const char *end; *part || count; part = end + 1) {
         end = bn_part_end(part);
         CHECK_STATUS(put_escaped_part(buffer, part, end));
@@ -147,7 +158,7 @@ static lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
     return LC_OK;
 }
 
-// What the two kinds of message have between the fixed part and the nodes.
+// What is between the header and the nodes.
 static lc_status put_head(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_string(buffer, msg->audit_user));
     return LC_OK;
@@ -171,7 +182,8 @@ static lc_status put_set_node(tbuffer *buffer, const bn_request_node *node) {
     CHECK_STATUS(put_string(buffer, node->target));
     return LC_OK;
 }
-// Query: flags, database, revision condition. Set: commit flags, text, number.
+// For a query the flags, database name and revision condition; for a set request the commit flags, text and
+// number.
 static lc_status put_options(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_u32(buffer, msg->flags));
     CHECK_STATUS(put_string(buffer, msg->text));
@@ -187,14 +199,14 @@ static lc_status put_revision(tbuffer *buffer, const bn_response_msg *msg) {
     return LC_OK;
 }
 
-// ---- Reading
+// --- Reading
 
 namespace {
 struct wire_reader {
     const tbuffer *buffer;
     const uint8_t *at, *end;
 };
-// A counted string, in the buffer.
+// A string in the buffer.
 struct wire_text {
     const uint8_t *bytes;
     uint32_t length;
@@ -230,7 +242,7 @@ static lc_status find_string(wire_reader *reader, wire_text *out) {
     CHECK_CONDITION(out->length < ts_size_max);
     return LC_OK;
 }
-// An absent string and one of length 0 are the same on the wire; both come back as an empty one.
+// A null string is sent as one of length 0, and is received as an empty one.
 static lc_status get_string(wire_reader *reader, tstring **out) {
     wire_text found = {};
     CHECK_STATUS(find_string(reader, &found));
@@ -264,27 +276,29 @@ static lc_status get_revision(wire_reader *reader, bn_response_msg *msg) {
     return LC_OK;
 }
 
-// ---- Nodes, read twice: measured and checked first, and then placed in the message's block
+// --- Reading nodes: measure_... are the first pass, place_... the second
 
 namespace {
-// A name as text: its parts are joined, escaped, and an absolute one is led by a separator unless it begins
-// with one because its first part is empty.
+// A name in the buffer, and what it will be as text: its parts are escaped and joined. An absolute name
+// begins with a separator; if its first part is empty it has one already, and none is added.
 struct wire_name {
-    const uint8_t *first; // part
+    const uint8_t *first; // where its first part begins
     uint32_t parts;
-    bool leading;
+    bool leading;  // a separator is added
     bool absolute; // begins with a separator
     bool bare;     // is "" or "/"
-    size_t length;
+    size_t length; // of the text, in bytes
 };
-// What the second pass needs to know from the first.
+// What the first pass finds out for the second.
 struct message_extent {
     bn_block_size size;
-    bool escapes; // some part of a name has characters to escape
-    bool checked; // the first pass is over
+    bool escapes; // some name has a character that must be escaped
+    bool checked; // the first pass is complete
 };
 } // namespace
 
+// Without a branch in the loop, so that the compiler can vectorise it: this looks at every byte of every
+// name.
 static bool has_special(const wire_text *part) {
     bool special = false;
     for (uint32_t i = 0; i < part->length; i++) {
@@ -293,8 +307,9 @@ static bool has_special(const wire_text *part) {
     }
     return special;
 }
-// Writes a part with its escapes, or only counts with a null `out`. A backslash is escaped before a slash, be
-// it the separator that follows the part, and before another backslash.
+// Writes a part with its escapes, and returns its length; with a null `out` it only counts. A backslash is
+// escaped before another backslash and before a slash, also before the separator that follows the part
+// (`separated`).
 static size_t write_escaped(const wire_text *part, bool separated, char *out) {
     const uint8_t *at = part->bytes, *end = at + part->length;
     size_t length = 0;
@@ -319,12 +334,13 @@ static lc_status measure_part(const wire_text *part, bool separated, message_ext
     *inout_length += extent->escapes ? write_escaped(part, separated, nullptr) : part->length;
     return LC_OK;
 }
-// Advances past the name.
+// Reads the name and advances the reader past it.
 static lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *out) {
     uint8_t absolute = 0;
     CHECK_STATUS(get_bytes(reader, &absolute, sizeof absolute));
     CHECK_STATUS(get_u32(reader, &out->parts));
     out->first = reader->at;
+    // One separator between two parts.
     out->length = out->parts ? out->parts - 1 : 0;
     bool first_is_empty = false;
     for (uint32_t i = 0; i < out->parts; i++) {
@@ -357,7 +373,7 @@ static lc_status write_name(const wire_reader *reader, const wire_name *name, bo
     return LC_OK;
 }
 
-// Advances past the attribute.
+// Locates an attribute and advances the reader past it.
 static lc_status find_attribute(wire_reader *reader, bn_wire_attrib *out) {
     const auto offset = static_cast<uint32_t>(reader->at - reader->buffer->buffer);
     CHECK_STATUS(bn_wire_locate(reader->buffer, offset, 0, out));
@@ -453,10 +469,10 @@ static lc_status place_set_node(wire_reader *reader, bn_block_builder *builder, 
     return LC_OK;
 }
 
-// ---- The two kinds of message
+// --- The two kinds of message
 
 namespace {
-// What follows each node, and the nodes; null for nothing.
+// How the trailers of a message type are written and read; null functions for a type without that trailer.
 template <typename Message, typename Node>
 struct message_trailers {
     uint16_t msg_type;
@@ -497,8 +513,8 @@ struct request_kind {
     static constexpr auto node_count = bn_request_per_node_array_length_quick;
     static constexpr auto node_at = bn_request_per_node_array_get_quick;
     static constexpr auto append = bn_request_per_node_array_append_takeover;
-    // A message of another type is logged and has no trailers; who receives one refuses it by its type, and
-    // the session goes on.
+    // Another type is logged and read without trailers. The receive path then refuses it by its type, without
+    // ending the session.
     static request_trailers trailers_of(uint16_t type) {
         const request_trailers found = find_trailers(request_types, type);
         if (!found.msg_type)
@@ -543,6 +559,7 @@ static lc_status serialize(typename Kind::message *msg, uint32_t header_bytes, t
     owned_tbuffer buffer;
     CHECK_STATUS(start_buffer(header_bytes, &buffer));
     tbuffer *bytes = buffer.pointer;
+    // Room for the header, which is written at the end, when the length is known.
     typename Kind::header header = {};
     msg->length = 0;
     CHECK_STATUS(tb_append_buf(bytes, &header, sizeof header));
@@ -607,7 +624,7 @@ static lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers
     return LC_OK;
 }
 
-// No memory is allocated for nodes until all of them have been checked, so a false count costs nothing.
+// Nodes are allocated only after all of them and the message trailer have been checked.
 template <typename Kind>
 static lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Kind::message **out) {
     CHECK_NULL(out);
@@ -625,6 +642,7 @@ static lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Ki
     uint32_t count = 0;
     message_extent extent = {};
     CHECK_STATUS(get_u32(&reader, &count));
+    // The second pass starts here as well.
     wire_reader nodes = reader;
     CHECK_STATUS(measure_nodes<Kind>(&reader, count, &trailers, &extent));
     if (trailers.get_message)

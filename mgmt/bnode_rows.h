@@ -1,4 +1,4 @@
-// The row of a type, for the files of the bindings only.
+// The table of types, and the wire form of attributes, for mgmt/bnode_*.cpp only. Callers hold no lock.
 #pragma once
 
 #include <cstdint>
@@ -6,11 +6,12 @@
 
 #include "mgmt/bnode_types.h"
 
-// How the bytes of a value are to be read.
+// What the bytes of a value are.
 enum class value_shape : uint8_t { none, natural, integer, real, bytes, ipaddr, ipprefix, text, binary };
 
-// The families of the wire form. A value in place has its size before it, or `leading` bytes of its record
-// and then an address; a text or binary its length.
+// The families of the wire form (see the table in bnode_attrib_wire.cpp). `kind` is the first word of the
+// attribute. A value of fixed size is preceded by its size, but one with `leading` bytes consists of these
+// and then an address.
 struct bn_wire_family {
     uint32_t kind;
     uint32_t leading;
@@ -21,58 +22,61 @@ inline constexpr bn_wire_family wire_number = {wire_kind_number, 0}, wire_bytes 
                                 wire_counted = {wire_kind_counted, 0};
 
 struct bn_type_row;
-// To text: a heap text. From text: into an attribute whose value is zero; LC_BAD_TYPE without a line.
+// To text: in memory of malloc(). From text: into an attribute whose value is zero; LC_BAD_TYPE, not logged,
+// for a text that can't be converted.
 using bn_text_out = lc_status (*)(const bn_type_row *row, const bn_attrib *attrib, char **out);
 using bn_text_in = lc_status (*)(const bn_type_row *row, const char *text, bn_attrib *attrib);
 
 struct bn_type_row {
     uint32_t number;
     const char *name;
-    uint8_t size; // of a value in place; 0 for allocated ones
+    uint8_t size; // of the value in bytes; 0 for one that is allocated
     value_shape shape;
     bool numeric;
     bn_text_out text_out;
     bn_text_in text_in;
-    bn_wire_family wire; // kind 0: none
-    const void *form;    // further data for the text functions
+    bn_wire_family wire; // kind 0: no wire form
+    const void *form;    // data for text_out and text_in
 };
 
-// Null for a number that is no type.
+// Null for an unknown type.
 const bn_type_row *bn_type_find(uint32_t type_and_flags);
 int bn_value_compare(const bn_type_row *row, const bn_attrib *a, const bn_attrib *b);
 
-// A value in place as a number; natural and integer shapes.
+// The value as a number, for the shapes natural and integer.
 uint64_t bn_value_natural(const bn_type_row *row, const bn_attrib *attrib);
 int64_t bn_value_integer(const bn_type_row *row, const bn_attrib *attrib);
 
-// Whole texts of decimal digits, with a sign only for the second; LC_BAD_TYPE without a line.
+// Decimal numbers that take the whole text, in range; the second may have a sign. LC_BAD_TYPE, not logged.
 lc_status bn_text_to_natural(const char *text, uint64_t limit, uint64_t *out);
 lc_status bn_text_to_integer(const char *text, int64_t least, int64_t most, int64_t *out);
 
-// As the operations of bnode_types.h, but nothing is logged and every failure is LC_BAD_TYPE.
+// As lc_str_to_ipaddr and lc_str_to_ipprefix, but every failure is LC_BAD_TYPE and is not logged.
 lc_status bn_text_to_ipaddr(const char *text, lc_ipaddr *out);
 lc_status bn_text_to_ipprefix(const char *text, lc_ipprefix *out);
 
-// ---- On the wire
+// --- The wire form
 
 std::remove_pointer_t<decltype(bn_attrib_copy_func::write)> bn_wire_write;
 std::remove_pointer_t<decltype(bn_attrib_copy_func::read)> bn_wire_read;
 
-// An attribute that was found well formed in the buffer.
+// An attribute in a buffer that has been checked.
 struct bn_wire_attrib {
     const bn_type_row *row;
     uint32_t id, flags;
-    const uint8_t *value; // in the buffer
-    uint32_t length;      // of the value
-    uint32_t used;        // of the whole
+    const uint8_t *value; // points into the buffer
+    uint32_t length;      // of the value, in bytes
+    uint32_t used;        // by the whole attribute, in bytes
 };
-// LC_ASSERTION with a line for a NUL among the bytes, since what follows it would be lost.
+// LC_ASSERTION, logged, if the bytes contain a NUL: as a C string the text would end there.
 lc_status bn_check_text(const uint8_t *bytes, uint32_t length);
-// Type 0 takes the one that the bytes have. Nothing is allocated.
+// Checks the attribute at `offset`. `type` is the expected one, 0 for any. Allocates nothing.
 lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_wire_attrib *out);
-// Whether its value is a string or bytes, which need memory besides the attribute.
+// Whether the value is a text or bytes, which need memory of their own.
 bool bn_wire_has_text(const bn_wire_attrib *found);
-// Fills a new attribute. `text`: a copy of the value followed by a NUL, if bn_wire_has_text.
+// Fills a new attribute. `text` is a copy of the value followed by a NUL, if bn_wire_has_text; it has to
+// outlive the attribute. Null: the caller sets the value.
 void bn_wire_fill(const bn_wire_attrib *found, char *text, bn_attrib *out);
-// The value of a text or binary, in memory that outlives the attribute: `length` bytes and a NUL.
+// Sets the value of a text or binary attribute to `length` bytes and a NUL in memory that outlives the
+// attribute.
 void bn_attrib_place_value(bn_attrib *attrib, char *text, uint32_t length);

@@ -1,9 +1,15 @@
-// The table of types, and the conversion of values from and to text.
+// The table of value types, and the conversion of values from and to text.
 //
-// A row gives the size of a value, the meaning of its bytes, the functions that convert it, and its family on
-// the wire. What depends on the shape only, such as comparing, is written once per shape. Conversion from
-// text is strict: the whole text, in range, with a sign only where the type has one. Anything else is
-// LC_BAD_TYPE, which is not logged, since it is how bad input is reported.
+// A row of the table has all that depends on the type: the size of a value, what its bytes are (its shape),
+// the two functions that convert it from and to text, and its family in the wire form. What depends only on
+// the shape, comparison for example, is a switch over the shapes.
+//
+// A number has to take the whole text and be in range, and may have a sign only if the type has one. Leading
+// blanks are refused. Only the duration text ("1.5 seconds", with bn_flag_display) may have other text after
+// its number. A text that can't be converted is LC_BAD_TYPE, which is not logged, because that is how bad
+// input of an operator is reported; only for invalid UTF-8 the bytes are logged.
+//
+// All functions here are pure or allocate their result; no lock is needed.
 #include "mgmt/bnode_types.h"
 
 #include <arpa/inet.h>
@@ -31,9 +37,10 @@ const lc_enum_entry bn_attribute_id_table[] = {
     {0, nullptr},
 };
 
-// ---- Numbers
+// --- Numbers
 
 lc_status bn_text_to_natural(const char *text, uint64_t limit, uint64_t *out) {
+    // strtoul would accept leading blanks and a sign.
     if (!isdigit(static_cast<unsigned char>(*text)))
         return LC_BAD_TYPE;
     char *end = nullptr;
@@ -72,6 +79,7 @@ uint64_t bn_value_natural(const bn_type_row *row, const bn_attrib *attrib) {
     }
 }
 int64_t bn_value_integer(const bn_type_row *row, const bn_attrib *attrib) {
+    // Extends the sign of a shorter value to 64 bits.
     const uint64_t value = bn_value_natural(row, attrib);
     const int unused = 64 - 8 * row->size;
     return static_cast<int64_t>(value << unused) >> unused;
@@ -145,7 +153,8 @@ static lc_status char_in(const bn_type_row *, const char *text, bn_attrib *attri
     attrib->value.bytes[0] = static_cast<uint8_t>(text[0]);
     return LC_OK;
 }
-// A number with a name; the form is its table, the table of types when there is none.
+// A number that is written as a name. The row's form is the table of names; bn_type_table, which is derived
+// from the rows themselves, is used if it is null.
 static const lc_enum_entry *names_of(const bn_type_row *row) {
     return row->form ? static_cast<const lc_enum_entry *>(row->form) : bn_type_table;
 }
@@ -160,20 +169,21 @@ static lc_status named_in(const bn_type_row *row, const char *text, bn_attrib *a
     return LC_OK;
 }
 
-// ---- Times: the form says how many microseconds a unit has and which texts are meant
+// --- Times. The row's form is a time_form.
 
 namespace {
 struct time_form {
     int64_t unit_us;
     lc_status (*to_str)(int64_t us, char **out);
     lc_status (*from_str)(const char *text, int64_t *out_us);
-    bool plain_without_display; // durations
+    bool plain_without_display; // durations are plain numbers unless bn_flag_display is set
 };
 } // namespace
 static lc_status datetime_to_str(int64_t us, char **out) {
     return lt_datetime_us_to_str(us, 0, out);
 }
 constexpr int64_t SEC = 1000000, MS = 1000, US = 1;
+// Defines daytime_sec_form, daytime_ms_form and daytime_us_form for example.
 #define TIME_FORMS(kind, to, plain)                                                                          \
     static constexpr time_form kind##_sec_form = {SEC, to, lt_str_to_##kind##_us, plain};                    \
     static constexpr time_form kind##_ms_form = {MS, to, lt_str_to_##kind##_us, plain};                      \
@@ -204,6 +214,7 @@ static lc_status time_in(const bn_type_row *row, const char *text, bn_attrib *at
         return natural ? natural_in(row, text, attrib) : integer_in(row, text, attrib);
     int64_t us = 0;
     CHECK_QUIET(form->from_str(text, &us));
+    // The limits of the lt_str_to_..._sec and _ms functions, which would log a failure.
     if ((form->unit_us != US && us < 0) || (form->unit_us == SEC && us / SEC > INT32_MAX))
         return LC_BAD_TYPE;
     store_low(row, static_cast<uint64_t>(us / form->unit_us), attrib);
@@ -220,7 +231,7 @@ static lc_status date_in(const bn_type_row *row, const char *text, bn_attrib *at
     return LC_OK;
 }
 
-// ---- Addresses
+// --- Addresses
 
 template <typename Value, lc_status (*ToStr)(const Value *, char **)>
 static lc_status record_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
@@ -262,7 +273,7 @@ static lc_status text_to_ipv6prefix(const char *text, lc_ipv6prefix *out) {
     return LC_OK;
 }
 
-// ---- Allocated values and none
+// --- Allocated values and none
 
 static lc_status none_out(const bn_type_row *, const bn_attrib *, char **out) {
     return text_given(safe_strdup(""), out);
@@ -292,7 +303,7 @@ static lc_status utf8_in(const bn_type_row *row, const char *text, bn_attrib *at
 static lc_status hostname_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     if (text[0] == '-')
         return LC_BAD_TYPE;
-    for (const char *at = text; *at; at++) // letters of ASCII, whatever the locale
+    for (const char *at = text; *at; at++) // ASCII only; isalnum() depends on the locale
         if (!((*at | 0x20) >= 'a' && (*at | 0x20) <= 'z') && !(*at >= '0' && *at <= '9') && *at != '-' &&
             *at != '.')
             return LC_BAD_TYPE;
@@ -308,7 +319,7 @@ static lc_status binary_in(const bn_type_row *, const char *text, bn_attrib *att
     return LC_OK;
 }
 
-// ---- The table
+// --- The table
 
 using shape = value_shape;
 static constexpr bn_type_row rows[] = {
@@ -377,7 +388,7 @@ static constexpr bn_type_row rows[] = {
 };
 constexpr size_t ROW_COUNT = sizeof rows / sizeof rows[0];
 
-// What is looked up by number or by name is made of the rows when this file is compiled.
+// Tables for lookup by number and by name, derived from the rows at compile time.
 namespace {
 struct derived_tables {
     lc_enum_entry names[ROW_COUNT + 1];
@@ -404,7 +415,7 @@ const bn_type_row *bn_type_find(uint32_t type_and_flags) {
     return type <= BN_TYPE_LAST ? tables.by_number[type] : nullptr;
 }
 
-// ---- Predicates and order
+// --- Predicates and order
 
 static const bn_type_row *row_with_value(uint32_t type_and_flags) {
     return type_and_flags & bn_flag_no_value ? nullptr : bn_type_find(type_and_flags);

@@ -1,5 +1,5 @@
-// The types of values: numbers, conversion from and to text, order, and wire form. What differs between types
-// is in one table (bnode_types.cpp).
+// Attributes and the types of their values: the numbers of the types, conversion from and to text, order, and
+// wire form. All that depends on the type is in one table (bnode_types.cpp).
 #pragma once
 
 #include <cstdint>
@@ -9,7 +9,7 @@
 #include "runtime/tstring.h"
 #include "runtime/ttime.h"
 
-// Type numbers, stable on the wire. A type and its flags travel in one word, type in the low 16 bits.
+// Type numbers, as on the wire. A type word is a type, in the low 16 bits, or'ed with flags.
 enum : uint32_t {
     bn_type_uint8 = 1,
     bn_type_int8 = 2,
@@ -41,7 +41,7 @@ enum : uint32_t {
     bn_type_duration_ms = 78,
     bn_type_duration_us = 79,
     bn_type_none = 90,
-    bn_type_any = 91, // in queries and tests only, no attribute holds it
+    bn_type_any = 91, // in queries and tests only; no attribute has it
     bn_type_btype = 92,
     bn_type_attribute = 93,
     bn_type_str = 101, // "string"
@@ -58,13 +58,13 @@ enum : uint32_t {
 };
 constexpr uint32_t BN_TYPE_LAST = 134;
 constexpr uint32_t BN_TYPE_MASK = 0xffff;
-constexpr uint32_t bn_flag_display = 0x10000; // durations: the duration text instead of a plain number
-constexpr uint32_t bn_flag_invalid = 0x40000; // the text that was to become the value did not convert
+constexpr uint32_t bn_flag_display = 0x10000; // durations: the text is "1.500000 seconds", not a plain number
+constexpr uint32_t bn_flag_invalid = 0x40000; // no value: its text could not be converted
 constexpr uint32_t bn_flag_deleted = 0x80000; // the node was deleted
-constexpr uint32_t bn_flag_absent = 0x100000; // names a type and holds no value
+constexpr uint32_t bn_flag_absent = 0x100000; // no value, only a type
 constexpr uint32_t bn_flag_no_value = bn_flag_invalid | bn_flag_absent;
 
-// Attribute ids, stable on the wire; also places in a bn_attrib_array.
+// Attribute ids, as on the wire; also the index in a bn_attrib_array.
 enum : uint32_t {
     bn_attrib_value = 1,
     bn_attrib_none = 4,
@@ -84,14 +84,15 @@ inline bool bn_attrib_id_valid(uint32_t id) {
 extern const lc_enum_entry *const bn_type_table;
 extern const lc_enum_entry bn_attribute_id_table[];
 
-// Predicates over a type word. With the invalid or the absent flag a type counts as having no value.
+// Predicates on a type word; false, and 0, with the invalid or the absent flag.
 bool bn_type_numeric(uint32_t type_and_flags);
 bool bn_type_string(uint32_t type_and_flags);
 bool bn_type_tbuf(uint32_t type_and_flags);
-bool bn_type_allocs(uint32_t type_and_flags);
-uint32_t bn_type_fixed_size(uint32_t type_and_flags); // 0 for allocated types
+bool bn_type_allocs(uint32_t type_and_flags);         // strings and `binary`
+uint32_t bn_type_fixed_size(uint32_t type_and_flags); // in bytes; 0 for allocated types
 
-// An address lies in its first 4 or 16 bytes as inet_pton gives it, the rest zero.
+// The address is in network byte order, as inet_pton writes it; that of an IPv4 address takes the first 4
+// bytes, and the rest is zero.
 struct lc_ipaddr {
     uint8_t family; // 4 or 6
     uint8_t reserved[15];
@@ -115,9 +116,10 @@ struct lc_ipv6prefix {
 };
 static_assert(sizeof(lc_ipaddr) == 32 && sizeof(lc_ipprefix) == 32 && sizeof(lc_ipv6prefix) == 17);
 
-// Texts of addresses. To text: the caller frees. LC_BAD_TYPE for what doesn't parse, LC_ASSERTION from the
-// two of either family. IPv4 is in host order; a prefix has the address in its high half and the mask in its
-// low.
+// Addresses from and to text, which the caller frees with free(). A text that can't be parsed is LC_BAD_TYPE,
+// not logged; for lc_str_to_ipaddr and lc_str_to_ipprefix it is LC_ASSERTION, which is logged. An IPv4
+// address as a number is in host order; an IPv4 prefix has the address in the upper and the mask in the lower
+// 32 bits. The comparisons return less than, equal to or greater than 0.
 lc_status lc_str_to_ipaddr(const char *text, lc_ipaddr *out);
 lc_status lc_ipaddr_to_str(const lc_ipaddr *value, char **out);
 int lc_ipaddr_compare(const lc_ipaddr *a, const lc_ipaddr *b);
@@ -135,12 +137,13 @@ struct bn_attrib {
     uint32_t type;
     uint32_t type_flags; // low 16 bits always 0
     uint32_t attribute_id;
-    uint32_t value_size; // fixed size, or length of the text or of the bytes
+    uint32_t value_size; // in bytes: the fixed size of the type, or the length of the text or bytes
     union {
         alignas(8) uint8_t bytes[32];
         tstring *string; // owned
         tbuffer *binary; // owned
-        // For a string or bytes in a block (bnode_block.h): the record follows the pointer to it.
+        // If the attribute is part of a block (bnode_block.h), the record that the pointer points to follows
+        // it.
         struct {
             tstring *string;
             tstring record;
@@ -154,21 +157,25 @@ struct bn_attrib {
 static_assert(sizeof(bn_attrib) == 48);
 struct bn_binding;
 
-// The wire form of an attribute; one row for each type. A type without one has null functions. `read` makes
-// an attribute of the type that the row was chosen by.
+// The wire form of attributes, indexed by type. The functions are null for a number without a wire form.
+// `read` makes a new attribute of `type`, and `write` overwrites or extends the buffer from `offset` on; the
+// last out, which may be null, gets the number of bytes.
 struct bn_attrib_copy_func {
     lc_status (*write)(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t *out_written);
     lc_status (*read)(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
                       uint32_t *out_used);
 };
 extern const bn_attrib_copy_func *const bn_attrib_copy_funcs; // rows 0 to BN_TYPE_LAST
-// Through the table, with its checks: a type outside 1 to 134 is LC_ASSERTION, one with no wire form LC_NULL.
+// Write and read an attribute by its entry in the table. A type outside 1 to 134 is LC_ASSERTION, one without
+// a wire form LC_NULL. An attribute that is read has a valid id. Received bytes are checked completely before
+// anything is allocated.
 lc_status bn_attrib_append_wire(const bn_attrib *attrib, tbuffer *buffer);
-// Reads the type ahead, then the attribute. Its id is one that an array may take as a place.
 lc_status bn_attrib_read_wire(const tbuffer *buffer, uint32_t offset, bn_attrib **out, uint32_t *out_used);
 
-// One row for each typed accessor: name, type number's name, value, what a setter is given, where it lies,
-// what a getter is given, how it gets it.
+// A row for each value type: its name in function names, the type number, the C++ type of the value, the
+// parameters of a setter, a pointer to the value that they give, the parameters of a getter, and the
+// statement that fills these from `stored`. The functions, bn_binding_get_uint32 for example, are declared at
+// the end of this file and defined in bnode_attrib.cpp.
 #define BN_PLAIN_VALUE(X, name, number, type)                                                                \
     X(name, number, type, (type value), bn_at(value), (type * out_value), bn_give_plain(out_value, stored))
 #define BN_VALUE_TYPES(X)                                                                                    \
@@ -207,11 +214,15 @@ lc_status bn_attrib_read_wire(const tbuffer *buffer, uint32_t offset, bn_attrib 
     BN_PLAIN_VALUE(X, btype, bn_type_btype, uint32_t)                                                        \
     BN_PLAIN_VALUE(X, attribute, bn_type_attribute, uint32_t)
 
-// The halves of an IPv6 address are its first and its last eight bytes, as they lie in memory.
+// bn_attrib_set_uint32, bn_attrib_new_uint32, bn_attrib_get_uint32, bn_binding_set_uint32,
+// bn_binding_new_uint32 and bn_binding_get_uint32, and the same for each of the types above.
 //
-// Setters refuse an attribute id outside 1 to 130, and 4, with LC_ASSERTION. Getters' outs may be null; an
-// attribute of another type gives LC_ASSERTION. Reading an empty slot of a binding gives 0 and leaves the
-// value as it was; an id beyond the binding's attributes gives LC_NOT_FOUND, no attributes at all LC_NULL.
+// Setters replace the old value; an attribute id outside 1 to 130, and 4, is LC_ASSERTION. The outs of
+// getters may be null; an attribute of another type is LC_ASSERTION, logged. For an empty slot of a binding
+// bn_binding_get_uint32 returns 0 and doesn't change the value; an id past its attributes is LC_NOT_FOUND,
+// and no attributes at all LC_NULL.
+//
+// The two halves of an IPv6 address are its first and its last eight bytes, copied without a conversion.
 #define BN_UNPAREN(...) __VA_ARGS__
 #define BN_DECLARE_TYPED(name, number, type, in, in_value, outs, give)                                       \
     lc_status bn_attrib_set_##name(bn_attrib *attrib, uint32_t id, uint32_t flags, BN_UNPAREN in);           \

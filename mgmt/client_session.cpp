@@ -1,3 +1,4 @@
+// The management session of a daemon; client_session.h describes how requests wait and when a wait ends.
 #include "mgmt/client_session.h"
 
 #include "mgmt/owners.h"
@@ -16,7 +17,7 @@ lc_status mgmt_client_init(mgmt_client *client, fdic_handler close_handler) {
     return LC_OK;
 }
 
-// 14014 and 14016 only say that nobody is there, which the caller logs in its own words.
+// LC_IO_ERROR and LC_IO_CLOSED mean that mgmtd isn't running, which the caller logs.
 static lc_status connect_quietly(gcl_session *session) {
     const lc_status status = gcl_session_client_connect_by_provider(session, "mgmtd", 1);
     if (status == LC_IO_ERROR || status == LC_IO_CLOSED)
@@ -55,8 +56,10 @@ lc_status mgmt_client_request(mgmt_client *client, bn_request_msg *request, bn_r
     if (exit_has_begun(client))
         return LC_CANCELLED;
     CHECK_STATUS(bn_request_msg_send(*client->session, request));
+    // A nested request overwrites what the outer one waits for, whose answer is then ignored. That is a
+    // mistake of the caller, and is logged.
     if (*client->response_expected)
-        (void)lc_check_condition(__func__, LC_FILE_NAME, __LINE__); // a nested request takes over the cells
+        (void)lc_check_condition(__func__, LC_FILE_NAME, __LINE__);
     *client->response_expected = 1;
     *client->expected_request_id = bn_request_get_msg_id(request);
     (void)bn_response_msg_free(client->captured_response);

@@ -1,25 +1,27 @@
-// GCL instances, and the decisions that all files of this library share.
+// GCL instances, and the design of this library (mgmt/gcl*.cpp).
 //
-// Records: an instance (`gcl`) owns its sessions and its body protocols; a session owns its socket, its read
-// buffer (gcl_frames.cpp reads frames out of it), its output queue, and through each protocol's hooks that
-// protocol's state. The opening handshake is protocol 1 (gcl_admin.cpp); waiting for it is gcl_blocking.cpp.
+// Records: an instance (`gcl`) owns its sessions and its body protocols. A session owns its socket, its read
+// buffer and its output queue (gcl_frames.cpp), and by the hooks of each body protocol that protocol's state.
+// gcl_session.cpp makes, connects and closes sessions. The handshake that opens a session is protocol 1
+// (gcl_admin.cpp); gcl_blocking.cpp waits for it.
 //
-// Locks: every operation takes the instance's lock, then the session's, by one guard that also turns
-// cancellation off. A thread that is cancelled while it sends so ends after its frame is queued and counted,
-// never between a write and the count of what went. Callbacks of the session's loop run with the loop's lock
-// held and then take these; no operation here takes a loop's lock, since interests of a loop that belongs to
-// another thread are posted to it.
+// Locks: every operation takes the instance's lock, then the session's, by a guard that also disables
+// cancellation. A cancelled thread therefore ends after its frame has been queued, never between a write and
+// the update of the counters. A loop calls the sessions' callbacks with the loop's own lock held, and they
+// then take these two; no operation here takes the lock of a loop, since changes of interests are posted to a
+// loop of another thread (event_fdintrcb.cpp).
 //
 // Threads: one thread runs the loop that drives an instance's sessions; any thread may send. A sender that
-// meets a closed peer closes the session on the spot, while the loop's thread may stand at the session's lock
-// in the activity function: it finds the session closed and does nothing. For the same reason the record of a
-// freed session stays with the instance until gcl_deinit; all that it held is freed at once.
+// finds the peer closed closes the session, while the loop's thread may be waiting for the session's lock in
+// the activity function; it then finds the session closed and does nothing. For the same reason the record of
+// a freed session is kept until gcl_deinit, without everything that it owned.
 //
-// Nesting: a frame's handler may run the loop again, and so read, send on, or close the session it was called
-// for. After every call into a handler or hook, and after every send, only what the session says now counts.
+// Nesting: the handler of a frame may run the loop, and thereby read frames of, send on, or close the session
+// that it was called for. After every call of a handler or a hook, and after every send, the state of the
+// session has to be checked again, and nothing that was read from it before may be used.
 //
-// What a peer can make this process keep is bounded: a frame by GCL_FRAME_MAX, the read buffer by what has
-// come, the output queue by GCL_QUEUE_MAX_BYTES.
+// Memory: a peer can only use up so much. A frame is limited by GCL_FRAME_MAX, the read buffer by what has
+// been received, the output queue by GCL_QUEUE_MAX_BYTES.
 #include "mgmt/gcl.h"
 
 #include <csignal>
@@ -57,8 +59,8 @@ lc_status gcl_options_get_defaults(gcl_options *out) {
     return LC_OK;
 }
 
-// A write to a peer that has gone shall come back as an error. A program that handles the signal itself has
-// that already, and keeps its handler.
+// A write to a closed peer must return EPIPE instead of ending the process. A process that handles SIGPIPE
+// gets EPIPE already, and keeps its handler.
 static void ignore_sigpipe() {
     struct sigaction action;
     if (sigaction(SIGPIPE, nullptr, &action) == 0 &&
@@ -122,7 +124,8 @@ lc_status gcl_shutdown(gcl *instance) {
     CHECK_NULL(instance);
     const gcl_instance_guard guard(instance);
     lc_status result = LC_OK;
-    // A close calls its handler, which may do anything: the list is walked from its start after each.
+    // A close calls the close handler, which may change the list, so it is searched from the start again
+    // after each.
     for (gcl_session *session = instance->sessions; session;) {
         if (session->state == GCL_SESSION_CLOSED) {
             session = session->next;
@@ -144,6 +147,7 @@ lc_status gcl_deinit(gcl **inout) {
     const cancel_off_guard cancel_off;
     if (instance->lock) {
         const lc_lock_guard guard(instance->lock);
+        // Until the list is empty: a close handler may have freed the session, or made another one.
         while (gcl_session *session = instance->sessions) {
             if (session->state != GCL_SESSION_CLOSED)
                 LOG_STATUS(gcl_session_close(session, 0));
@@ -166,7 +170,7 @@ lc_status gcl_deinit(gcl **inout) {
     return LC_OK;
 }
 
-// ---- What body protocols ask
+// --- What body protocols use
 
 gcl *gcl_session_get_instance(gcl_session *session) {
     return session ? session->instance : nullptr;

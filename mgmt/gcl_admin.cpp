@@ -1,7 +1,10 @@
-// Body protocol 1, "admin": the greeting and the opening of services, client side. Runs in the frame reader,
-// with both locks held. The sequence on the wire is always: greeting, greeting response, open service, its
-// response. The peer's word is checked against the owner of its socket file before anything else is asked of
-// it.
+// Body protocol 1, "admin": the handshake that opens a session, and services, on the client side. The frame
+// reader calls its handlers, with both locks held.
+//
+// The provider sends a greeting; the client answers with a greeting response, then asks for a service with
+// open service, which the provider answers. A client trusts a provider on a Unix socket only if the process
+// that listens on it belongs to root or to its own user, and if the ids in the greeting, if any, are those of
+// the owner of the socket file. Otherwise the client closes the session.
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -23,7 +26,7 @@ static void take_text(char (&text)[33], const char (&field)[32]) {
     text[sizeof field] = 0;
 }
 
-// The frame's body, when all of the layout is there.
+// Copies the body of a frame. LC_ASSERTION if it is shorter than the layout.
 template <typename Layout>
 static lc_status body_of(const tbuffer *frame, Layout *out) {
     CHECK_CONDITION(tb_length(frame) >= static_cast<int32_t>(GCL_HEADER_BYTES + sizeof(Layout)));
@@ -88,8 +91,8 @@ static bool log_bad_ids(const gcl_session *session, int32_t uid, int32_t gid, ui
     return false;
 }
 
-// Anybody may make a socket where the provider's would be: only root's and our own user's are trusted. The
-// kernel knows whose process listens, whatever the greeting says.
+// Every user can create a socket with the provider's name, since the directory is writable for all, and send
+// any ids in a greeting. The user id of the listening process comes from the kernel.
 static bool listener_is_trusted(const gcl_session *session) {
     ucred listener{};
     socklen_t length = sizeof listener;
@@ -104,8 +107,8 @@ static bool listener_is_trusted(const gcl_session *session) {
     return false;
 }
 
-// A peer that gives no ids is taken for one of ours; one that gives them must own the socket that we reached
-// it by.
+// Checks the peer by the ids in its greeting. Without ids (-1 and -1) it gets those of this process;
+// otherwise they must be those of the owner of its socket file, or of this process if it has no file.
 static bool peer_is_trusted(const gcl_session *session, int32_t *inout_uid, int32_t *inout_gid) {
     const int32_t uid = *inout_uid, gid = *inout_gid;
     if (session->family != AF_UNIX && session->family != AF_INET) {
@@ -129,6 +132,7 @@ static bool peer_is_trusted(const gcl_session *session, int32_t *inout_uid, int3
     uid_t wanted_uid = geteuid();
     gid_t wanted_gid = getegid();
     if (session->peer.path[0]) {
+        // Ids that match nobody's, in case the owner can't be determined.
         wanted_uid = static_cast<uid_t>(-1);
         wanted_gid = static_cast<gid_t>(-1);
         LOG_STATUS(lf_get_file_owner(session->peer.path, &wanted_uid, &wanted_gid));
@@ -167,7 +171,7 @@ static lc_status receive_greeting(gcl_session *session, gcl_body_protocol *, tbu
         LC_LOG(LC_LOG_INFO, "session %d: dropping greeting to non-connected session", session->id);
     }
     if (session->state == GCL_SESSION_CLOSED)
-        return LC_OK; // the peer went while we answered
+        return LC_OK; // sending has found the peer closed
     admin->state = GCL_ADMIN_GREETED;
     auto uid = static_cast<int32_t>(to_host(body.uid)), gid = static_cast<int32_t>(to_host(body.gid));
     if (!peer_is_trusted(session, &uid, &gid))
@@ -248,7 +252,7 @@ lc_status gcl_admin_register(gcl *instance) {
     admin.session_free = admin_session_free;
     admin.connection_established = admin_established;
     admin.query_session_state = admin_query_state;
-    // What only providers receive falls to the catch-all.
+    // Messages that only a provider receives are ignored.
     const struct {
         uint16_t mtype;
         gcl_frame_handler function;

@@ -1,13 +1,15 @@
-// The opening of a service while the caller waits: a loop over this instance's interests alone, used before
-// the session is in general use. Both locks are held all the time, the wait included.
+// Opening a service while the caller waits: a poll() loop over the interests of this instance only. It is
+// used before the session is used by other threads. Both locks are held all the time, also while it waits.
 //
-// The thread that waits here has its signals blocked, since its loop takes them only in a wait of its own. A
-// peer that never answers must not make the process deaf to the ones that end it: while one of them is
-// pending the wait ends with LC_CANCELLED, and the loop that the caller goes back to takes it. A thread with
-// a loop of its own hears of the end from the one that takes the signals, by the `ending` of the instance.
+// The calling thread has its signals blocked, because the event loop accepts them only while it waits itself.
+// A peer that never answers must not keep the process from ending, so the wait ends with LC_CANCELLED while
+// SIGHUP, SIGINT or SIGTERM is pending; the caller's event loop then handles the signal. A thread that
+// doesn't handle signals is told by the thread that does, by the flag `ending` of the instance. Both are
+// checked five times a second.
 //
-// The interests of a round are a copy, and a callback may take away what a later entry of the copy refers
-// to. That does no harm: their functions look at the session, which outlives its interests.
+// Each round works on a copy of the interests. A callback may remove an interest that is still to come in the
+// copy; that is harmless, because the interest's function checks the state of the session, whose record is
+// still there.
 #include <algorithm>
 #include <cerrno>
 #include <csignal>
@@ -24,15 +26,15 @@ constexpr int64_t END_LOOK_MS = 200;
 
 namespace {
 
-// What a caller can wait for a change of.
+// What a caller can wait for: a change of any of these.
 struct watched_state {
     uint64_t frames_sent, frames_received;
     int32_t session_state, protocol_state;
 };
-// A timer of the interest list, armed anew whenever its delay is seen to change.
+// A timer of the interest list; it starts again whenever its delay has changed.
 struct seen_timer {
     uint32_t id;
-    int64_t delay, due_ms; // by lt_monotonic_ms
+    int64_t delay, due_ms; // ms; due_ms is compared with lt_monotonic_ms
     bool called;
 };
 struct blocking_wait {
@@ -83,11 +85,12 @@ bool gcl_end_is_pending(const gcl *instance) {
     return false;
 }
 
-// Milliseconds left, -1 for no limit, -2 when time is up.
+// The time left in milliseconds; -1 without a limit, -2 if there is none left.
 static int64_t time_left(blocking_wait *wait) {
     if (wait->timeout_ms < 0)
         return -1;
     const int64_t now = lt_curr_time_ms();
+    // The wall clock may have been set back; the timeout then starts again.
     if (now < wait->started_ms)
         wait->started_ms = now;
     const int64_t left = wait->timeout_ms - (now - wait->started_ms);
@@ -103,7 +106,7 @@ static void forget_deleted_timers(blocking_wait *wait, const fdic_event_array *e
     }
 }
 
-// The wait's record of a timer, which runs from when it was first seen.
+// The record of a timer, which is made when the timer is first seen, and runs from then on.
 static lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t now, seen_timer **out) {
     uint32_t at = 0;
     while (at < wait->timer_count && wait->timers[at].id != event->id)
@@ -122,7 +125,7 @@ static lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t
     return LC_OK;
 }
 
-// Calls the timers that are due, each once, and gives the time to the next one (-1: none).
+// Calls the timers that are due, each once. `out_next`: milliseconds to the next one, -1 if there is none.
 static lc_status run_timers(blocking_wait *wait, const fdic_event_array *events, int64_t *out_next) {
     const int64_t now = lt_monotonic_ms();
     *out_next = -1;
@@ -165,9 +168,11 @@ static lc_status fill_polled(const fdic_event_array *events, pollfd *polled) {
     return LC_OK;
 }
 
-// Calls what is ready; `out_stop` when what the caller waits for has changed.
+// Calls the functions of the descriptors that are ready, until something that the caller waits for has
+// changed.
 static lc_status run_ready(const blocking_wait *wait, const fdic_event_array *events, const pollfd *polled,
                            const watched_state *before, bool *out_stop) {
+    // As in an event loop, an error shows as readable and writable, so that the session finds it.
     constexpr short broken = POLLERR | POLLHUP | POLLNVAL;
     for (uint32_t i = 0; i < fdic_event_array_length_quick(events) && !*out_stop; i++) {
         const fdic_event *event = fdic_event_array_get_quick(events, i);
@@ -196,6 +201,7 @@ static lc_status wait_round(blocking_wait *wait, bool *out_stop) {
         return LC_CANCELLED;
     owned<fdic_event_array, fdic_event_array_release> events;
     CHECK_STATUS(fdic_events_query(wait->instance->interests, &events.pointer));
+    // Before the timers are called, which may cause the change that is waited for.
     const watched_state before = look(wait);
     int64_t next_timer = -1;
     CHECK_STATUS(run_timers(wait, events.pointer, &next_timer));
@@ -206,7 +212,7 @@ static lc_status wait_round(blocking_wait *wait, bool *out_stop) {
     const int64_t left = time_left(wait);
     if (left < -1)
         return LC_IO_TIMED_OUT;
-    // No poll is longer than to the next timer or the next look for an end.
+    // Waits at most until the next timer, or until it is time to check again whether the process is ending.
     const int64_t slice = next_timer >= 0 && next_timer < END_LOOK_MS ? next_timer : END_LOOK_MS;
     const bool sliced = left < 0 || slice < left;
     const int ready = poll(polled.pointer, count, static_cast<int>(sliced ? slice : left));
@@ -248,8 +254,8 @@ lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int st
     return LC_OK;
 }
 
-// One wait of the opening. A peer that closes or never answers is an ordinary event; a closed one ends the
-// session.
+// One step of opening a service. A peer that closes, or doesn't answer in time, is an ordinary event and not
+// logged. If it closes, the session is closed.
 static lc_status wait_for_peer(gcl_session *session, int on_received, uint16_t protocol, int64_t timeout_ms) {
     const lc_status status =
         gcl_session_do_blocking_io(session->instance, session, 0, on_received, 1, 1, protocol, timeout_ms);
@@ -275,7 +281,8 @@ lc_status gcl_session_client_open_service_blocking(gcl_session *session, uint16_
             return LC_GENERIC;
     }
     CHECK_STATUS(gcl_session_client_open_service(session, protocol, service, name, reserved));
-    // A refusal while another service is open leaves the state of the greeting, with nothing pending.
+    // If another service is open already, a refusal sets the state back to GREETED, but then nothing is
+    // pending.
     while (admin->state != GCL_ADMIN_OPEN_ANSWERED && admin->pending_service) {
         CHECK_QUIET(wait_for_peer(session, 1, protocol, timeout_ms));
         if (admin->state < GCL_ADMIN_GREETING_AWAITED || admin->state > GCL_ADMIN_OPEN_ANSWERED ||

@@ -1,20 +1,21 @@
-// Frames: sending through the output queue, and the reader that takes them out of what has come.
+// Frames: the output queue, and the reader that extracts frames from the received bytes. The loop calls
+// gcl_session_fd_read_write_timeout_activity when a session's socket is ready; any thread may send.
 //
-// The reader nests. A frame's handler may wait for an answer by running the loop, and the inner rounds read
-// further frames of this same session: its buffer is then moved, grown, emptied or, when the session was
-// freed, gone. So the place of the next frame lives in the session alone and has moved on before the frame,
-// copied, is handed over; after the hand-over the framing loop looks at nothing but the session, and first of
-// all whether it is still connected.
+// The reader is reentrant. The handler of a frame may wait for an answer by running the loop, which then
+// reads further frames of the same session: meanwhile the read buffer may be moved, enlarged, emptied, or
+// freed with the session. The position of the next frame is therefore kept in the session only, and is
+// advanced before the frame is passed, as a copy, to its handler. Afterwards the framing loop checks that the
+// session is still connected and uses nothing that it has read from it before.
 //
-// The total length that a frame announces is believed only within GCL_HEADER_BYTES and GCL_FRAME_MAX;
-// anything else ends the session. Even then memory is taken for what has come, 64 KiB at a time, never for
-// what was announced.
+// The length in a frame's header must be between GCL_HEADER_BYTES and GCL_FRAME_MAX, or the session is
+// closed. The read buffer does not grow to that length at once, but with the bytes that have been received:
+// when less than GCL_READ_ROOM is free, to four times its size, and by at most 8 MiB more than it then needs
+// (tb_ensure_size).
 //
-// The output queue is bounded in bytes. A frame that would exceed the bound is not taken. The first such
-// frame is logged; the following ones are counted, and their number is logged when the queue has drained to
-// half. The sender gets LC_CANCELLED, so that it does not wait for an answer to a frame that was never sent,
-// nor log a line of its own. An answer that is not taken is replaced by a refusal, for which the queue keeps
-// a reserve.
+// The output queue is limited in bytes. A frame that would exceed the limit is refused: the first one is
+// logged, the others are counted, and their number is logged when the queue has drained to half of the limit.
+// The sender gets LC_CANCELLED, which tells it not to wait for an answer, and which is not logged. If the
+// frame was a response, a short refusal is queued instead, for which the queue has a reserve.
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -43,13 +44,14 @@ void gcl_byte_swap_frame_header(void *header) {
     auto *bytes = static_cast<uint8_t *>(header);
     if constexpr (std::endian::native == std::endian::big)
         return;
+    // The ident is a string and keeps its order.
     for (const uint32_t offset : {4u, 8u, 12u, 20u, 28u})
         swap32(bytes + offset);
     for (const uint32_t offset : {16u, 18u, 24u, 26u})
         swap16(bytes + offset);
 }
 
-// ---- Sending
+// --- Sending
 
 static void fill_header(uint8_t *at, uint32_t sequence, uint16_t proto, uint16_t mtype, uint32_t total) {
     gcl_frame_header header = {
@@ -66,13 +68,14 @@ static lc_status check_sendable(const gcl_session *session) {
     return LC_GENERIC;
 }
 
-// Whether the queue, of that size, takes a frame of this length.
+// Whether a frame of `total` bytes fits in the queue, whose limit is `queue_max`.
 static lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue_max) {
     if (total > GCL_FRAME_MAX) {
         LC_LOG(LC_LOG_WARNING, "session %d: message of %llu bytes does not fit a frame", session->id,
                static_cast<unsigned long long>(total));
         return LC_NO_BUFFER_SPACE;
     }
+    // An empty queue takes any frame, or one larger than the limit could never be sent.
     if (!session->queued_bytes || session->queued_bytes + total <= queue_max)
         return LC_OK;
     if (!session->frames_lost++)
@@ -84,6 +87,7 @@ static lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue
 }
 
 static void note_drained(gcl_session *session) {
+    // At half of the limit, so that a queue which stays nearly full doesn't log a pair of lines per frame.
     if (!session->frames_lost || session->queued_bytes > GCL_QUEUE_MAX_BYTES / 2)
         return;
     LC_LOG(LC_LOG_NOTICE, "session %d: output queue drains again, %llu frames were lost", session->id,
@@ -102,6 +106,7 @@ static lc_status queue_frame(gcl_session *session, tbuffer **inout_buffer, uint3
     frame->session = session;
     frame->sequence = sequence;
     frame->time_queued_ms = lt_curr_time_ms();
+    // From here on the queue owns the frame; if writing fails, gcl_session_free frees it.
     (session->queue_tail ? session->queue_tail->next : session->queue_head) = frame;
     session->queue_tail = frame;
     session->queued_bytes += frame->length;
@@ -109,7 +114,7 @@ static lc_status queue_frame(gcl_session *session, tbuffer **inout_buffer, uint3
     return LC_OK;
 }
 
-// Puts the header into the room at the start of the buffer and takes the buffer over.
+// Writes the header to the start of the buffer, and queues the buffer.
 static lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtype, tbuffer **inout_buffer) {
     const auto total = static_cast<uint32_t>(tb_length(*inout_buffer));
     const uint32_t sequence = session->sequence++;
@@ -192,7 +197,7 @@ static void finish_frame(gcl_session *session) {
     free(frame);
 }
 
-// What one run may still send; without a limit, everything.
+// The number of bytes that one run of the queue may send; no limit without a rate limit.
 static uint64_t slice_bytes(const gcl_session *session) {
     return session->rate_limit ? session->rate_limit * 1024ull * RATE_SLICE_MS / 1000 : UINT64_MAX;
 }
@@ -206,7 +211,8 @@ static lc_status wait_for_slice(gcl_session *session) {
     return LC_OK;
 }
 
-// Writes until all has gone or the socket is full; `out_blocked` for the latter.
+// Writes until the queue is empty or the socket is full (`out_blocked`). With a rate limit the rest of the
+// queue waits for a timer.
 static lc_status write_queue(gcl_session *session, bool *out_blocked) {
     uint64_t slice = slice_bytes(session);
     while (gcl_frame *frame = session->queue_head) {
@@ -221,6 +227,7 @@ static lc_status write_queue(gcl_session *session, bool *out_blocked) {
         now = now < slice ? now : slice;
         const lc_status status =
             lf_write_bytes(session->fd, frame->bytes + frame->written, static_cast<int64_t>(now), &written);
+        // What was written is counted also if the write was cut short by an error.
         frame->written += written;
         session->queued_bytes -= written;
         session->counters.bytes_sent += written;
@@ -243,6 +250,7 @@ static lc_status write_queue(gcl_session *session, bool *out_blocked) {
 lc_status gcl_run_output_queue(gcl_session *session) {
     LC_LOG(LC_LOG_DEBUG, "session %d: running output queue", session->id);
     bool blocked = false;
+    // A closed peer is an ordinary event for the sender: the close handler reports it.
     const lc_status status = write_queue(session, &blocked);
     if (status != LC_OK) {
         LOG_STATUS(gcl_session_close(session, 0));
@@ -257,7 +265,7 @@ lc_status gcl_run_output_queue(gcl_session *session) {
     return LC_OK;
 }
 
-// ---- Handing frames over
+// --- Passing frames to their handlers
 
 static lc_status check_header(const gcl_session *session, const gcl_frame_header *header, uint32_t received) {
     if (memcmp(header->ident, GCL_FRAME_IDENT, sizeof header->ident) != 0) {
@@ -317,13 +325,13 @@ static lc_status hand_over(gcl_session *session, tbuffer **inout_frame) {
     return LC_OK;
 }
 
-// ---- Reading
+// --- Reading
 
 static uint32_t bytes_unread(const gcl_session *session) {
     return static_cast<uint32_t>(tb_length(session->read_buffer)) - session->read_position;
 }
 
-// An empty buffer starts at its front again, and in its first size if a large frame has made it grow.
+// Empties the buffer; one that a large frame has enlarged is replaced by one of the first size.
 static lc_status reset_buffer(gcl_session *session) {
     session->read_position = 0;
     if (tb_size(session->read_buffer) > GCL_READ_BUFFER_KEEP) {
@@ -335,7 +343,7 @@ static lc_status reset_buffer(gcl_session *session) {
     return LC_OK;
 }
 
-// The next whole frame, copied; null when more has to come.
+// A copy of the next complete frame; null if more bytes have to be received first.
 static lc_status next_frame(gcl_session *session, tbuffer **out_frame) {
     const uint32_t unread = bytes_unread(session);
     if (unread < GCL_HEADER_BYTES) {
@@ -363,6 +371,7 @@ static lc_status next_frame(gcl_session *session, tbuffer **out_frame) {
     session->counters.bytes_received += total;
     LC_LOG(LC_LOG_DEBUG, "session %d: received full frame seq %d len %d", session->id,
            to_host(header.sequence), total);
+    // Before the frame is handled: the handler may read further frames from this buffer.
     session->read_position += total;
     if (!bytes_unread(session))
         CHECK_STATUS(reset_buffer(session));
@@ -380,8 +389,8 @@ static lc_status deliver_frames(gcl_session *session) {
     return LC_OK;
 }
 
-// Room for a read. What has been delivered leaves the front of the buffer here, once for a read: between the
-// frames of one read it would cost a move of all that is left for each of them.
+// Makes room for a read. Frames that have been delivered are deleted from the front of the buffer only here,
+// once per read; deleting each frame would move all the others each time.
 static lc_status make_room(gcl_session *session) {
     tbuffer *buffer = session->read_buffer;
     if (tb_avail(buffer) >= GCL_READ_ROOM)
@@ -411,6 +420,7 @@ static lc_status read_activity(gcl_session *session) {
         return LC_IO_CLOSED;
     }
     CHECK_STATUS(tb_set_length(buffer, length + static_cast<uint32_t>(got)));
+    // All frames that were received before the peer closed are delivered first.
     CHECK_QUIET(deliver_frames(session));
     if (closed && session->state == GCL_SESSION_CONNECTED) {
         LC_LOG(LC_LOG_DEBUG, "session %d: detected socket close on fd %d", session->id, session->fd);
@@ -433,9 +443,9 @@ static lc_status timer_activity(gcl_session *session) {
     return gcl_run_output_queue(session);
 }
 
-// Called by the loop that drives the session. The session may have been closed by another thread meanwhile,
-// and its descriptor may be another's by now: what counts is the session's state under its lock, never the
-// descriptor given.
+// Called by the loop that drives the session. Another thread may have closed the session in the meantime, and
+// its descriptor may have been reused since. Only the session's state, under its lock, is relevant, not the
+// descriptor that the loop passes.
 lc_status gcl_session_fd_read_write_timeout_activity(int, uint32_t kind, void *data, void *) {
     CHECK_NULL(data);
     auto *session = static_cast<gcl_session *>(data);

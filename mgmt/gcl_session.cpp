@@ -1,9 +1,10 @@
-// Client sessions: names and paths, making, connecting, closing, freeing. Callers hold nothing; each
-// operation takes both locks. A connection attempt waits between its tries with the locks held, as only a new
-// session makes one.
+// Client sessions: names and socket paths, making, connecting, closing and freeing sessions. Callers hold no
+// lock; each operation takes both. While it connects, a session may wait for seconds with the locks held; no
+// other thread knows the session by then.
 //
-// A session that could not connect keeps its registration in the interest list, wanting nothing: taking it
-// out would tell the owner that a session was lost which never stood. gcl_session_free takes it out.
+// A session that could not connect keeps its registration in the interest list, without interest in reading
+// or writing: removing it would call the close handler and thereby report the loss of a session that was
+// never open. gcl_session_free removes it.
 #include <cerrno>
 #include <cstddef>
 #include <cstdio>
@@ -26,7 +27,7 @@ constexpr size_t CLIENT_NAME_LIMIT = 20;
 constexpr int CONNECT_ATTEMPTS = 6;
 constexpr int CONNECT_DELAY_MS = 1500;
 
-// ---- Names
+// --- Names
 
 static lc_status check_client_name(const char *name) {
     if (name && strchr(name, '-')) {
@@ -109,11 +110,13 @@ static void endpoint_text(const gcl_endpoint *endpoint, char *out, size_t size) 
     snprintf(out, size, "%d.%d.%d.%d:%d", bytes[0], bytes[1], bytes[2], bytes[3], ntohs(address.sin_port));
 }
 
-// ---- Making
+// --- Making
 
 static lc_status open_unix(gcl_session *session) {
+    // The socket is bound to a path of its own, which is how the provider sees who is connected.
     const char *path = session->local.path;
-    // Any user's client may have to make the directory, and nobody may take another's socket away.
+    // The first client of any user creates the directory. With the sticky bit nobody can remove another
+    // user's socket.
     if (mkdir(GCL_SOCKET_DIRECTORY, 0700) == 0)
         (void)chmod(GCL_SOCKET_DIRECTORY, 01777);
     (void)unlink(path);
@@ -206,6 +209,7 @@ static lc_status new_steps(gcl_session *session, const char *client_name, const 
         make_endpoint(&session->local, "client", session->local_name);
     CHECK_STATUS(open_socket(session));
     CHECK_STATUS(gcl_run_hooks(session, GCL_HOOK_NEW));
+    // Appended, so that gcl_shutdown closes sessions in the order in which they were made.
     gcl_session **link = &instance->sessions;
     while (*link)
         link = &(*link)->next;
@@ -234,7 +238,7 @@ lc_status gcl_session_client_new(gcl *instance, const char *client_name, const s
     session->sequence = GCL_SEQUENCE_CLIENT;
     const lc_status status = new_steps(session, client_name, address, length);
     if (status != LC_OK) {
-        // Half made and never shown to anybody: it goes without the words of a session that was lost.
+        // Nobody knows the session yet, so it is freed without gcl_session_close and its log lines.
         if (session->fd >= 0)
             close(session->fd);
         if (session->fd >= 0 && session->local.path[0])
@@ -248,8 +252,9 @@ lc_status gcl_session_client_new(gcl *instance, const char *client_name, const s
     return LC_OK;
 }
 
-// ---- Connecting
+// --- Connecting
 
+// Closes a session that could not connect.
 static void give_up(gcl_session *session) {
     if (session->fd_interest >= 0)
         LOG_STATUS(fdic_event_update_fd(session->instance->interests, session->fd_interest, 0, 0));
@@ -262,6 +267,7 @@ static void give_up(gcl_session *session) {
 }
 
 static lc_status try_connect(gcl_session *session, int attempts) {
+    // EISCONN: an earlier attempt on the non-blocking socket has succeeded meanwhile.
     for (;;) {
         attempts--;
         if (connect(session->fd, reinterpret_cast<const sockaddr *>(&session->peer.address),
@@ -326,7 +332,7 @@ lc_status gcl_session_client_connect_by_provider(gcl_session *session, const cha
     return LC_OK;
 }
 
-// ---- Ending
+// --- Ending
 
 static void drop_interests(gcl_session *session) {
     fdic *interests = session->instance->interests;
@@ -334,7 +340,7 @@ static void drop_interests(gcl_session *session) {
     session->rate_timer = session->fd_interest = -1;
     if (timer >= 0)
         LOG_STATUS(fdic_event_delete_timer(interests, timer));
-    if (descriptor >= 0) // calls the close handler, therefore nothing follows it
+    if (descriptor >= 0) // last, since it calls the close handler
         LOG_STATUS(fdic_event_delete_fd(interests, descriptor));
 }
 
@@ -347,11 +353,13 @@ lc_status gcl_session_close(gcl_session *session, int flush) {
     if (connected && flush && session->queue_head)
         LOG_STATUS(gcl_run_output_queue(session));
     if (session->state == GCL_SESSION_CLOSED)
-        return LC_OK; // its peer had gone
+        return LC_OK; // the flush has found the peer closed
     if (session->queue_head)
         LC_LOG(LC_LOG_WARNING, "session %d: closed with output queue", session->id);
     if (connected)
         LOG_STATUS(gcl_run_hooks(session, GCL_HOOK_CLOSED));
+    // The state and the descriptor are changed before the interests are removed: the close handler must find
+    // the session closed, and may free it.
     close(session->fd);
     session->fd = -1;
     session->state = GCL_SESSION_CLOSED;
@@ -377,6 +385,7 @@ lc_status gcl_session_free(gcl_session **inout) {
     *inout = nullptr;
     if (!session)
         return LC_OK;
+    // Its lock could not be made, so it has nothing else either.
     if (!session->lock) {
         free(session);
         return LC_OK;
@@ -394,6 +403,7 @@ lc_status gcl_session_free(gcl_session **inout) {
     drop_interests(session);
     gcl_free_queue(session);
     tb_free(&session->read_buffer);
+    // The record stays with the instance: another thread may be waiting for its lock.
     session->next = session->instance->freed;
     session->instance->freed = session;
     return LC_OK;
@@ -404,7 +414,7 @@ void gcl_forget_record(gcl_session *session) {
     free(session);
 }
 
-// ---- State
+// --- State
 
 lc_status gcl_session_get_state(gcl_session *session, int32_t *out_state, int32_t *out_admin_state) {
     CHECK_NULL(session);

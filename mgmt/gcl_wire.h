@@ -1,4 +1,5 @@
-// The layouts of frames and of admin messages, once for both ends. Text fields are padded with zero bytes.
+// The layout of frames and of the messages of protocol 1, "admin", for both ends. Numbers are in network byte
+// order. Text fields are padded with zero bytes, and have no NUL if they are full.
 #pragma once
 
 #include <cstddef>
@@ -7,20 +8,20 @@
 #include "runtime/byte_order.h"
 
 constexpr char GCL_FRAME_IDENT[4] = {'G', 'C', 'L', 'F'};
-constexpr uint32_t GCL_FRAME_MARKER = 0x33323130; // "0123" in memory here, "3210" on the wire
+constexpr uint32_t GCL_FRAME_MARKER = 0x33323130; // "0123" in host order, "3210" on the wire
 constexpr uint32_t GCL_FRAME_VERSION = 1;
 constexpr uint32_t GCL_SEQUENCE_CLIENT = 2000001;
 constexpr uint32_t GCL_SEQUENCE_PROVIDER = 1000001;
 constexpr const char *GCL_SOCKET_DIRECTORY = "/tmp/gcl-socks/";
-// The path of a socket in that directory: `role` is "provider" or "client". A development system has the
-// user's number in it.
+// Writes the path of a socket to `out`, which has `size` bytes. `role` is "provider" or "client". On a
+// development system (lc_devel_is_production) the path contains the user id.
 void gcl_socket_path(const char *role, const char *name, char *out, size_t size);
 
 struct gcl_wire_header {
     char ident[4];
     be32 marker;
     be32 version;
-    be32 total_length;
+    be32 total_length; // header and body, in bytes
     be16 header_length;
     be16 reserved;
     be32 sequence;
@@ -34,7 +35,7 @@ static_assert(offsetof(gcl_wire_header, total_length) == 12 &&
 static_assert(offsetof(gcl_wire_header, sequence) == 20 && offsetof(gcl_wire_header, proto) == 24);
 static_assert(offsetof(gcl_wire_header, mtype) == 26 && offsetof(gcl_wire_header, body_length) == 28);
 
-// The same header in host order, as a frame lies in memory before it is sent and after it was read.
+// The header in host order, before it is sent and after it has been received.
 struct gcl_frame_header {
     char ident[4];
     uint32_t marker;
@@ -112,5 +113,5 @@ static_assert(sizeof(gcl_wire_open_service_response) == 52);
 static_assert(offsetof(gcl_wire_open_service_response, peer_name) == 12 &&
               offsetof(gcl_wire_open_service_response, status) == 44);
 
-// Swaps a header between host and wire order, in place; the ident stays.
+// Converts a header between host and network byte order, in place. The ident is not changed.
 void gcl_byte_swap_frame_header(void *header);

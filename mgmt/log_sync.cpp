@@ -1,4 +1,5 @@
-// Log levels and the time zone, as the management tree has them. What is not there leaves a level as it is.
+// Log levels and the time zone from the management tree. A node that doesn't exist leaves its level
+// unchanged.
 #include "mgmt/log_sync.h"
 
 #include <cstdio>
@@ -23,7 +24,7 @@ node_name process_level_node() {
     snprintf(name.text, sizeof name.text, NODE_SYSLOG "/process/%s/log_level", lc_log_get_lls_process_name());
     return name;
 }
-// local0 is 0, local1 is 1.
+// The number of the process's syslog facility among the local ones: 1 for local1.
 int class_index() {
     int32_t facility = 0;
     (void)lc_log_get_syslog_facility(&facility);
@@ -87,7 +88,7 @@ lc_status qv_init_log_level(mdc *session) {
     return LC_OK;
 }
 
-// What the log asks when it is given a session.
+// lc_log_get_facility calls this, if it is given a session.
 lc_status qv_read_log_facility(mdc *session, uint32_t *out_facility) {
     owned_binding binding;
     CHECK_STATUS(
@@ -106,7 +107,8 @@ lc_status value_text(const bn_binding *binding, owned_tstring *out) {
     return LC_OK;
 }
 
-// Each step says in `ended` whether what it has found ends the search. No level, empty or deleted, doesn't.
+// Each function applies one changed node and reports in `ended` whether the other nodes are left alone. A
+// level that was emptied or deleted doesn't end the search.
 lc_status change_process_level(const bn_binding *binding, bool *ended) {
     owned_tstring value;
     uint32_t flags = 0;

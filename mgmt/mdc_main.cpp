@@ -1,5 +1,5 @@
-// The client library: blocking requests over the daemon's own send function, and the walk of an array of
-// bindings. Answering monitoring queries and unpacking change events stand in mdc_misc.cpp.
+// The client library: blocking requests by the daemon's send function, and the search of an array of bindings
+// by pattern. mdc_misc.cpp answers monitoring queries and decodes change events.
 #include "mgmt/mdc_main.h"
 
 #include <cstdarg>
@@ -26,6 +26,7 @@ lc_status mdc_init(mdc_send_function send, void *client_data, void *reserved_1, 
     CHECK_NULL(handle);
     *handle = {send, client_data, reserved_1, reserved_2, session};
     *out_handle = handle;
+    // The log can't call this room itself, so it is given the function.
     lc_log_facility_from_session = qv_read_log_facility;
     return LC_OK;
 }

@@ -1,8 +1,11 @@
-// Answering a monitoring query, and unpacking the event that reports a configuration change.
+// Answering monitoring queries, and decoding the event that reports a configuration change.
 //
-// A monitoring query brings the daemon's registered nodes along as "registration_info" nodes. They make a
-// tree for the length of the query, with the capability mask as each node's value; it decides which names can
-// be walked. A registered wildcard is walked by asking the daemon for the children that it matches.
+// A monitoring query contains the nodes that the daemon has registered, as "registration_info" nodes. They
+// are put into a tree for the time of the query, and only names in that tree can be iterated. For a
+// registered wildcard ("/a/*") the daemon is asked for the names of the children.
+//
+// All of this runs in the session's callback. What a query can make this process do is limited: in the depth
+// and number of registered names, since the tree is processed recursively, and in the size of the answer.
 #include <cstdlib>
 #include <cstring>
 
@@ -13,10 +16,10 @@
 #include "runtime/logging.h"
 
 constexpr const char *WILDCARD = "*";
-// The tree is walked and freed by recursion, and its names come from a peer: a name of more parts is not
-// registered.
+// A name of more parts isn't registered: the tree is processed and freed by recursion, and a peer chooses the
+// names.
 constexpr uint32_t REGISTERED_PARTS_MAX = 64;
-// Of all names together. A node of the tree takes far more memory than a part takes in a message.
+// For all names together: a node of the tree takes far more memory than a name part takes in a message.
 constexpr uint32_t REGISTERED_TOTAL_MAX = 4096;
 
 // --- Registered nodes
@@ -53,7 +56,7 @@ lc_status mdc_remote_reg_new_node(mdc_remote_reg **out, const char *name, uint32
     return LC_OK;
 }
 
-// The tree owns the record from here on.
+// On success the tree owns the record.
 lc_status mdc_remote_reg_add_node(tree *registered, mdc_remote_reg **inout_record) {
     CHECK_NULL(inout_record);
     CHECK_NULL(*inout_record);
@@ -86,12 +89,12 @@ uint32_t mdc_remote_reg_get_cap_mask(const mdc_remote_reg *record) {
     return record ? record->cap_mask : 0;
 }
 
-// --- The walk
+// --- Iterating over the registered nodes
 
 namespace {
 
-// What an answer has come to. A walk that finds more than a frame holds ends early: nobody gets it, and this
-// process may have its memory locked.
+// The size of the answer so far. If it exceeds a frame, which can't be sent, the search ends at once: the
+// memory of this process may be locked.
 struct mon_answer {
     uint64_t bytes;
     bool too_large;
@@ -111,7 +114,7 @@ struct mon_walk {
 
 static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth);
 
-// The bytes of a binding in a message, a little more for a name with escapes.
+// The number of bytes that a binding takes in a message; a little too large for a name with escapes.
 static uint64_t wire_bytes(const bn_binding *binding) {
     constexpr uint64_t NODE_BYTES = 13, PART_BYTES = 4, ATTRIBUTE_BYTES = 20;
     uint64_t bytes = NODE_BYTES;
@@ -137,6 +140,7 @@ static lc_status walk_child(const mon_walk *walk, tstr_array *parts, const char 
     owned_tstring name;
     CHECK_STATUS(ts_new_str(&name.pointer, child));
     CHECK_STATUS(tstr_array_append_takeover(parts, &name.pointer));
+    // The parts are restored also after a failure, before it is returned.
     const lc_status status = mdc_mon_iterate_node_internal(walk, parts, depth);
     owned_tstring popped;
     CHECK_STATUS(tstr_array_pop(parts, &popped.pointer));
@@ -161,11 +165,12 @@ static lc_status walk_tree_child(tree *, tree_node *, const char *name, void *va
     return LC_OK;
 }
 
-// The registered wildcard itself: its children are those that the daemon names.
+// The name is that of a registered wildcard: the daemon is asked for the children of its parent.
 static lc_status walk_wildcard(const mon_walk *walk, tstr_array *parts, uint32_t depth) {
     owned_tstring last;
     CHECK_STATUS(tstr_array_pop(parts, &last.pointer));
     owned_tstring parent;
+    // No early return until the last part is back in its place.
     lc_status status = bn_binding_name_parts_to_name_tstr(parts, 1, &parent.pointer);
     owned_tstr_array names;
     if (status == LC_OK)
@@ -197,6 +202,7 @@ static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array 
     if (!node)
         return LC_OK;
     if (!record)
+        // Only an intermediate node of registered names.
         return walk_children(walk, parts, node, depth + 1);
     const char *text = ts_str(name.pointer);
     if (lc_is_suffix("/*", mdc_remote_reg_get_name(record), 0) && lc_is_suffix("/*", text, 0))
@@ -212,7 +218,7 @@ static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array 
 
 // --- The query
 
-// `inout_total`: the parts of the names so far.
+// `inout_total`: the number of parts of all names so far.
 static lc_status add_registration(tree *registered, const bn_binding *binding, uint32_t *inout_total) {
     const bn_attrib *attribute = nullptr;
     CHECK_STATUS(bn_binding_get_attrib(binding, bn_attrib_capability_mask, &attribute));
@@ -232,6 +238,7 @@ static lc_status add_registration(tree *registered, const bn_binding *binding, u
     }
     if (*inout_total > REGISTERED_TOTAL_MAX)
         return LC_OK;
+    // The first name beyond the limit is logged, further ones are ignored silently by the test above.
     *inout_total += count;
     if (*inout_total > REGISTERED_TOTAL_MAX) {
         LC_LOG(LC_LOG_ERR, "Registered names of more than %u parts, ignored from %s on", REGISTERED_TOTAL_MAX,
@@ -248,8 +255,8 @@ static lc_status answer_node(const mon_walk *walk, const bn_node_info *info, con
     const char *name = bn_binding_get_name_quick(binding);
     const tstr_array *known = nullptr;
     CHECK_STATUS(bn_binding_get_name_parts_const(binding, &known, nullptr));
-    // A copy of the parts takes many times the bytes of the name, which a peer chooses. The walk changes
-    // them, and a name that is too long to be registered is in no tree.
+    // Iterating changes the parts and needs a copy, which takes many times the bytes of the name, which a
+    // peer chooses. A name with more parts than a registered one can have isn't in the tree anyway.
     owned_tstr_array parts;
     const bool walked = info->subop == bn_query_iterate;
     if (walked && tstr_array_length_quick(known) > REGISTERED_PARTS_MAX)
@@ -274,6 +281,7 @@ static lc_status move_to_response(bn_response_msg *response, bn_binding_array *f
     const uint32_t count = bn_binding_array_length_quick(found);
     for (uint32_t i = 0; i < count; i++) {
         owned_binding binding;
+        // No shift: removing from the front one by one would take quadratic time.
         CHECK_STATUS(bn_binding_array_remove_no_shift(found, i, &binding.pointer));
         if (binding.pointer)
             CHECK_STATUS(bn_query_response_msg_append_binding_takeover(response, &binding.pointer, node_id));
@@ -348,7 +356,7 @@ struct change_entry {
     const char *name; // of the changed node
     const bn_binding *old_value;
     const bn_binding *new_value;
-    bn_binding_array *old_values; // null when nobody asked for them
+    bn_binding_array *old_values; // null if the caller doesn't want them
     bn_binding_array *new_values;
 };
 
@@ -438,7 +446,8 @@ lc_status mdc_event_config_change_notif_extract(bn_binding_array *bindings, bn_b
     for (uint32_t i = 0; i < count; i++) {
         const bn_binding *binding = bn_binding_array_get_quick(bindings, i);
         const char *name = binding ? bn_binding_get_name_quick(binding) : nullptr;
-        // Each entry copies its values: the same one again and again would take any amount of memory.
+        // A name that occurs several times is processed once: each time would copy its values, and a peer
+        // could use up the memory by repeating it.
         if (!name || (before && strcmp(before, name) == 0))
             continue;
         before = name;

@@ -1,4 +1,5 @@
-// The daemon's registered monitoring nodes, as a tree for the length of one query.
+// The monitoring nodes that a daemon has registered, as a tree for the time of one query. For mdc_misc.cpp
+// and its tests.
 #pragma once
 
 #include "runtime/tree.h"
@@ -6,11 +7,12 @@
 
 struct mdc_remote_reg;
 
+// A record of a registered node: its name, and its capability mask.
 lc_status mdc_remote_reg_new_node(mdc_remote_reg **out, const char *name, uint32_t cap_mask);
 void mdc_remote_reg_free(mdc_remote_reg **inout);
-lc_status mdc_remote_reg_add_node(tree *registered, mdc_remote_reg **inout_record); // the tree owns it then
+lc_status mdc_remote_reg_add_node(tree *registered, mdc_remote_reg **inout_record); // the tree takes it over
 void mdc_remote_reg_free_for_tree(void *value);
-// Both null when there is no such node; a mere path element has no record.
+// Both outs are null if there is no such node. An intermediate node has no record.
 lc_status mdc_remote_reg_get_node_tree(const tree *registered, const tstr_array *parts, tree_node **out_node,
                                        const mdc_remote_reg **out_record);
 const char *mdc_remote_reg_get_name(const mdc_remote_reg *record);

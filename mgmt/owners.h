@@ -1,4 +1,4 @@
-// Owners for a scope, of what the management code makes and gives.
+// Names for the scope guards of the management code's objects, owned_binding for example.
 #pragma once
 
 #include <cstdlib>

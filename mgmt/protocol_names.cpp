@@ -3,7 +3,8 @@
 #include <cstdio>
 #include <cstring>
 
-// In the order of their numbers, from 0. "raw" is 255, and those between have their number as a name.
+// In the order of their numbers, from 0. Number 255 is "raw", and those without a name are "ipproto-150" and
+// so on.
 static const char *const protocol_names[] = {"ip",
                                              "icmp",
                                              "igmp",

@@ -1,5 +1,6 @@
-// Names of the IP protocols as the configuration spells them: mgmtd refuses what wccpd would not understand.
+// The names of IP protocols in the configuration, for mgmtd, which checks them, and for wccpd, which uses
+// them.
 #pragma once
 
-// The number of a protocol by its name (0 to 255), or -1 for a text that is not a name.
+// The number of a protocol, 0 to 255, by its name; -1 for an unknown name.
 int ip_protocol_by_name(const char *name);

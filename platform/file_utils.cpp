@@ -1,11 +1,12 @@
-// Two file operations that must be safe whatever is at the path already.
+// Two file operations that are safe whatever already is at the path.
 //
-// A file is written beside its place under a name of its own and then moved there in one step, so that a
-// reader sees the old bytes or the new ones, and a write that fails (a full disk) loses nothing. What is at
-// the path is checked first; a link put there after the look is replaced, never followed.
+// A file is written under a temporary name in the same directory and then renamed, so that a reader sees
+// either the old or the new bytes, and a failed write, on a full disk for example, loses nothing. What is at
+// the path is checked first; a link that is created there after the check is replaced by the rename, and
+// never followed.
 //
-// errno has the reason of a failure when these return, whatever the log did in between. Each runs with
-// cancellation off: it holds descriptors, and it is short.
+// errno has the reason of a failure when they return, although logging may have changed it meanwhile.
+// Cancellation is disabled in both: they are short and hold descriptors.
 
 #include "platform/file_utils.h"
 
@@ -42,7 +43,7 @@ struct owned_fd {
     int fd;
 };
 
-// A name in a directory that goes again unless the file has been moved away from it.
+// The name of a temporary file, which is deleted unless the name is cleared after the rename.
 struct temporary_name {
     ~temporary_name() {
         if (text[0]) {
@@ -87,15 +88,16 @@ lc_status ensure_dir_of_file(const char *path, mode_t mode) {
         part += strspn(part, "/");
         char *end = strchr(part, '/');
         if (!end)
-            return dir.fd >= 0 ? LC_OK : status_of_errno(); // what is left is the file's own name
+            return dir.fd >= 0 ? LC_OK : status_of_errno(); // the last part is the file's name
         *end = '\0';
+        // Relative to the directory just opened: a path that is changed meanwhile can't redirect this.
         const bool made = mkdirat(dir.fd, part, mode) == 0;
         if (!made && errno != EEXIST)
             return status_of_errno();
         dir.replace(openat(dir.fd, part, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         if (dir.fd < 0)
             return status_of_errno();
-        if (made && fchmod(dir.fd, mode) != 0) // whatever the umask took
+        if (made && fchmod(dir.fd, mode) != 0) // mkdirat has applied the umask
             return status_of_errno();
         part = end + 1;
     }
@@ -135,6 +137,7 @@ lc_status write_file(const char *path, mode_t mode, const char *bytes, int overw
     }
     owned_fd file(mkostemp(temporary.text, O_CLOEXEC));
     if (file.fd < 0) {
+        // mkostemp has not created it, so it must not be deleted.
         temporary.text[0] = '\0';
         return status_of_errno();
     }

@@ -1,10 +1,10 @@
-// The appliance's limits.
+// The limits of the appliance.
 //
-// The file is read once, by the first question of whichever thread, and never again: the ids of the tunnels
-// and the size of the interface table hang from these numbers, so they must not move under a running daemon.
+// The file is read once, by the first call in any thread: tunnel ids and the size of the interface table
+// depend on these numbers, so they must not change in a running daemon.
 //
-// A number that would push the last reserved encapsulation entry (max_user_tunnels + 22 + 84) past the 16-bit
-// tunnel ids counts as a bad line, and so does one that leaves no interface at all.
+// Tunnel ids have 16 bits. max_user_tunnels is limited so that the last reserved encapsulation entry
+// (max_user_tunnels + 22 + 84) has one; a larger number is a bad line, and so is a max_interfaces of 0.
 
 #include "platform/limits.h"
 
@@ -39,7 +39,7 @@ static const char *skip_blanks(const char *text) {
     return text;
 }
 
-// Reads one line; false when it cannot be one of ours.
+// Applies one line to the limits; false for a bad line.
 static bool take_line(const char *line, platform_limits *limits) {
     const char *at = skip_blanks(line);
     if (*at == '\0' || *at == '#')
@@ -64,7 +64,7 @@ static bool take_line(const char *line, platform_limits *limits) {
 }
 
 platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
-    const cancel_off_guard whole; // the file is closed at the end, cancelled or not
+    const cancel_off_guard whole; // the file must be closed
     platform_limits limits = defaults;
     if (out_bad_line)
         *out_bad_line = 0;
@@ -76,9 +76,10 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
     }
     bool more = true;
     for (unsigned number = 1; more; number++) {
+        // By character, because fgets() would not show a NUL, nor that a line goes on.
         char line[128];
         size_t length = 0;
-        bool good = true; // neither longer than any good line nor with a NUL inside
+        bool good = true; // fits in the buffer and contains no NUL
         int c;
         while ((c = fgetc(file)) != EOF && c != '\n') {
             good = good && c != '\0' && length + 1 < sizeof line;
@@ -88,6 +89,7 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
         more = c != EOF;
         line[length] = '\0';
         line[strcspn(line, "\r")] = '\0';
+        // A comment may be of any length.
         if ((good || *skip_blanks(line) == '#') && take_line(line, &limits))
             continue;
         if (out_bad_line)

@@ -1,19 +1,20 @@
-// Numbers of the appliance that do not change while the daemon runs, from /etc/opt/rvl/platform.conf: one
-// `name value` a line. A missing file means the defaults; a bad line is logged and passed over.
+// Limits of the appliance, from /etc/opt/rvl/platform.conf, which has a line `name value` for each. They
+// don't change while a process runs. Without the file the defaults apply; a bad line is logged and ignored.
+// Any thread, no lock.
 #pragma once
 
 #include <cstdint>
 
 constexpr const char *PLATFORM_CONF_PATH = "/etc/opt/rvl/platform.conf";
 
-uint32_t get_max_user_tunnel_number(); // "max_user_tunnels"
-uint32_t get_max_tunnel_number();      // the same plus 22
+uint32_t get_max_user_tunnel_number(); // "max_user_tunnels", 200 by default
+uint32_t get_max_tunnel_number();      // the same plus the 22 tunnels of the system
 uint32_t qv_max_interfaces();          // "max_interfaces", 128 by default
 
-// What the first of the above reads, once: the file's numbers over the defaults.
+// What the first call of one of these reads: the numbers in the file, or the defaults.
 struct platform_limits {
     uint32_t max_user_tunnels;
     uint32_t max_interfaces;
 };
-// With `out_bad_line` nothing is logged: it gets the number of the first bad line, or 0.
+// If `out_bad_line` isn't null, it gets the number of the first bad line, or 0, and nothing is logged.
 platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line = nullptr);

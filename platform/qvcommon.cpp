@@ -1,10 +1,9 @@
-// libqvcommondyn.so: what the daemon asks of the platform's closed library, in a form that another library
-// of that name may take the place of. This file has the small things; notifications are in
+// libqvcommondyn.so, our stand-in for the platform's closed library: all but the notifications, which are in
 // qvcommon_netlink.cpp.
 //
-// Only the names of qvcommon.h are exported (qvcommon.map). Nothing here or in the other file has a
-// constructor or a destructor, and nothing is used of the C++ library: the notification thread runs until the
-// process is gone, through everything that exit() tears down.
+// Only the names in qvcommon.h are exported (qvcommon.map). The notification thread runs until the process
+// has ended, also while exit() runs destructors. Therefore nothing in these two files has a constructor or a
+// destructor, and nothing of the C++ library is used that does.
 
 #include "platform/qvcommon.h"
 
@@ -17,7 +16,7 @@
 #include "platform/qvcommon_netlink.h"
 #include "platform/qvcommon_transport.h"
 
-// Null when the program doesn't define it.
+// Null if the program doesn't define it.
 #pragma weak qv_state_event_transport
 
 int32_t g_qvif_skfd = -1;
@@ -42,7 +41,7 @@ int qv_start_netlink_monitor(uint32_t kind) {
     return qv_netlink_start(kind);
 }
 
-// 0 when the event was handed on, else minus the number of events that nobody took.
+// 0 if the program accepted the event, else the negative number of events that it has not accepted so far.
 int qv_state_event_send(uint32_t one, const char *group_id, uint32_t role, const uint8_t *code,
                         struct gcl_session *session) {
     if (qv_state_event_transport && qv_state_event_transport(one, group_id, role, code, session) == 0)

@@ -1,28 +1,27 @@
-// Link and address notifications from rtnetlink.
+// Notifications of link and address changes, from rtnetlink(7).
 //
-// One thread, started by the first qv_start_netlink_monitor and there until the process is gone, owns
-// everything below but the callbacks, the set of started kinds and the wish for a look: the table of
-// interfaces by index and the socket that hears the kernel's notifications. It blocks every signal, and
-// sleeps until the kernel says something.
+// The first qv_start_netlink_monitor starts a thread that runs until the process has ended. It owns the table
+// of known interfaces and the socket that receives the kernel's notifications; other threads only use the
+// atomic variables (callbacks, started kinds, the request for a scan) and the eventfd that wakes it. It
+// blocks all signals, holds no lock, and sleeps until there is something to read.
 //
-// Events. A link state event is a change of an interface's name, administrative state or operational state
-// (IFF_UP, IFF_RUNNING); a notification that changes none of these is not an event. An address event is any
-// notification about an IPv4 address of the interface. A name that disappears (deleted, renamed, moved to
-// another namespace) is reported as down, followed by an address event, before a new name is reported, unless
-// another interface has the name by then. When a kind starts, every interface is reported, so that no change
-// between the caller's own look and the start is lost.
+// Events. A link state event is a change of an interface's name, administrative state (IFF_UP) or operational
+// state (IFF_RUNNING); a notification that changes none of these is not an event. An address event is any
+// notification about an IPv4 address of the interface. If a name disappears, because its interface is
+// deleted, renamed or moved to another namespace, it is reported as down, followed by an address event,
+// before a new name is reported; but not if another interface has the name by then. When a kind is started,
+// every interface is reported, so that no change between the caller's own query and the start is lost.
 //
-// Looks. When a kind starts, when the kernel's queue has overrun (a storm, or a callback that took long), or
-// when a notification names an interface that is not known, nothing that is queued can be trusted: what is
-// older than the look would undo what the look has found. The queue is therefore emptied first. That drops
-// notifications of every kind; therefore all interfaces are queried, and each started kind reports every one
-// of them, changed or not. An interface that is gone is reported as down, and a name that now belongs to
-// another interface is reported as down and then as it is. Notifications that arrive during the look are read
-// after it and lead to the latest state. A look that fails is repeated a little later.
+// Scans. All interfaces are queried when a kind is started, when the socket's queue has overrun (because of
+// many changes, or a callback that took long), and when a notification is about an unknown interface.
+// Notifications that are older than the scan would undo its result, so the queue is emptied first. That drops
+// notifications of both kinds, and so each started kind reports every interface afterwards, changed or not.
+// An interface that is gone is reported as down; a name that belongs to another interface now is reported as
+// down, and then in its new state. Notifications that arrive during the scan are read after it and lead to
+// the latest state. A scan that fails is repeated after 200 ms.
 //
-// The process may be in exit() while this thread runs. Hence no object here has a destructor, and of libnl
-// only the core is used, whose code has none either; libnl-route's objects hang from tables that its
-// destructors take down.
+// The thread still runs while the process is in exit(). Therefore no object here has a destructor, and only
+// the core of libnl is used, which has none either; libnl-route has tables that are destroyed at exit.
 
 #include "platform/qvcommon_netlink.h"
 
@@ -50,7 +49,7 @@ namespace {
 
 constexpr int RECEIVE_BUFFER_BYTES = 208 * 1024;
 constexpr int LOOK_AGAIN_MS = 200;
-constexpr int LOOK_TRIES = 5; // a look is inconsistent when interfaces change during it
+constexpr int LOOK_TRIES = 5; // a scan during which interfaces change is inconsistent, and is repeated
 #ifdef WCCP_SANITIZED
 constexpr size_t STACK_BYTES = 512 * 1024;
 #else
@@ -59,7 +58,7 @@ constexpr size_t STACK_BYTES = 128 * 1024;
 
 struct interface {
     int index;
-    char name[IFNAMSIZ]; // empty: another interface has taken the name
+    char name[IFNAMSIZ]; // empty: another interface has the name now
     uint32_t admin_up, link_up;
 };
 struct interface_table {
@@ -68,13 +67,13 @@ struct interface_table {
 };
 
 std::atomic<qv_netlink_callback> callbacks[QV_NOTIFY_KINDS];
-std::atomic<uint32_t> started; // bit by kind
-std::atomic<bool> look_wanted;
-int wake_fd = -1; // an eventfd: look_wanted has changed
+std::atomic<uint32_t> started; // a bit per kind
+std::atomic<bool> look_wanted; // a scan is to be made
+int wake_fd = -1;              // an eventfd: look_wanted has been set
 pthread_mutex_t start_mutex = PTHREAD_MUTEX_INITIALIZER;
-bool running; // start_mutex
+bool running; // the thread has been started; start_mutex guards it
 
-// The thread's own.
+// Used by the thread only.
 nl_sock *monitor_socket;
 interface_table known;
 
@@ -123,7 +122,7 @@ bool append(interface_table *table, const interface *entry) {
     return true;
 }
 
-// A name that no interface carries any more.
+// Reports a name that no interface has any more.
 void tell_gone(const char *name) {
     tell_link(name, 0, 0);
     tell_address(name);
@@ -134,7 +133,8 @@ bool read_link(nlmsghdr *header, interface *out) {
     if (nlmsg_parse(header, sizeof(ifinfomsg), attributes, IFLA_MAX, nullptr) < 0)
         return false;
     const auto *link = static_cast<const ifinfomsg *>(nlmsg_data(header));
-    // A bridge reports its ports in messages of its own family; a port that leaves the bridge still exists.
+    // A bridge sends messages about its ports, of family AF_BRIDGE; a port that leaves the bridge is deleted
+    // there, but still exists.
     if (link->ifi_family != AF_UNSPEC || !attributes[IFLA_IFNAME])
         return false;
     *out = {};
@@ -152,7 +152,7 @@ void want_look() {
 void link_is(const interface *now) {
     interface *holder = find_name(&known, now->name);
     if (holder && holder->index != now->index)
-        holder->name[0] = '\0'; // its own message is still to come
+        holder->name[0] = '\0'; // it has been renamed or deleted, and its own notification follows
     interface *before = find_index(&known, now->index);
     if (!before) {
         if (!append(&known, now))
@@ -161,6 +161,7 @@ void link_is(const interface *now) {
         tell_address(now->name);
         return;
     }
+    // Copied, since the table changes before the callbacks run.
     const interface old = *before;
     *before = *now;
     const bool renamed = strncmp(old.name, now->name, IFNAMSIZ) != 0;
@@ -202,7 +203,7 @@ int on_notification(nl_msg *message, void *) {
             if (const interface *entry = find_index(&known, static_cast<int>(address->ifa_index)))
                 tell_address(entry->name);
             else if (if_indextoname(address->ifa_index, name))
-                want_look(); // not one that is gone already
+                want_look(); // it exists, and its own notification has been missed
         }
         break;
     default:
@@ -220,7 +221,8 @@ int on_look_answer(nl_msg *message, void *table) {
     return NL_OK;
 }
 
-// Everything that the monitor socket holds, unread. A queue can't hold more than a few thousand messages.
+// Discards all notifications that are queued. The queue can't hold more than a few thousand; the limit only
+// prevents an endless loop while new ones keep arriving.
 void empty_queue() {
     char byte;
     for (int i = 0; i < 100000; i++)
@@ -237,7 +239,7 @@ nl_sock *open_socket() {
     return nullptr;
 }
 
-// Asks the kernel for all interfaces. False when there is no whole answer.
+// Queries all interfaces, on a socket of its own. False if there is no complete and consistent answer.
 bool ask_for_all(interface_table *out) {
     nl_sock *socket = open_socket();
     if (!socket)
@@ -262,6 +264,7 @@ bool look_at_all() {
         free(fresh.entries);
         return false;
     }
+    // The table is replaced before anything is reported.
     interface_table old = known;
     known = fresh;
     for (uint32_t i = 0; i < old.count; i++) {
@@ -281,6 +284,7 @@ bool look_at_all() {
 void *monitor(void *) {
     for (;;) {
         int wait = -1;
+        // Before the scan, so that a request made during it isn't lost.
         if (look_wanted.exchange(false, std::memory_order_acq_rel) && !look_at_all()) {
             want_look();
             wait = LOOK_AGAIN_MS;
@@ -293,6 +297,7 @@ void *monitor(void *) {
             continue;
         if (fds[0].revents) {
             const int result = nl_recvmsgs_default(monitor_socket);
+            // Most of all ENOBUFS: the queue has overrun.
             if (result < 0 && result != -NLE_AGAIN && result != -NLE_INTR)
                 want_look();
         }
@@ -313,6 +318,7 @@ bool open_all() {
     wake_fd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (!monitor_socket || wake_fd < 0)
         return false;
+    // Multicast notifications have no sequence number that could be checked.
     nl_socket_disable_seq_check(monitor_socket);
     nl_socket_modify_cb(monitor_socket, NL_CB_VALID, NL_CB_CUSTOM, on_notification, nullptr);
     return nl_socket_set_nonblocking(monitor_socket) == 0 &&
@@ -328,7 +334,7 @@ int start_thread() {
     pthread_attr_setstacksize(&attributes, STACK_BYTES);
     sigset_t all, previous;
     sigfillset(&all);
-    pthread_sigmask(SIG_SETMASK, &all, &previous); // the thread inherits it
+    pthread_sigmask(SIG_SETMASK, &all, &previous); // the new thread inherits the mask
     pthread_t thread;
     const int error = pthread_create(&thread, &attributes, monitor, nullptr);
     pthread_sigmask(SIG_SETMASK, &previous, nullptr);

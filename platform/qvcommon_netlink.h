@@ -1,4 +1,4 @@
-// The netlink side of libqvcommondyn.so, for its other file only: qvcommon.h has what is exported.
+// The notifications of libqvcommondyn.so, for qvcommon.cpp only. qvcommon.h documents these functions.
 #pragma once
 
 #include <cstdint>

@@ -1,14 +1,15 @@
-// The mailbox as tunneld uses it, and the attaching that both sides share.
+// tunneld's functions on the mailbox, and what both sides share.
 //
-// Nothing here takes a lock: tunneld has one thread for its commands, and a role is one load. Every field is
-// read and written in one access of its own width with acquire and release order; neither the compiler nor
-// the machine moves an input across the `command` that hands it over.
+// Nothing here takes a lock: one thread of tunneld handles commands, and a role is a single load. Every field
+// is accessed as a whole and with acquire and release order, so that no access to an input is moved across an
+// access to `command`.
 //
-// wccpd gives up a command after about two seconds and may then replace it while tunneld is still reading.
-// Therefore the inputs are read twice, with `command` checked before, between and after: wccpd sets `command`
-// to 0 before it touches an input, hence inputs that agree, with no 0 seen, belong to one command. A reader
-// that does not get there in a thousand tries (there is no command any more, or wccpd is held up in the
-// middle of writing one) takes what it has; it checks `command` again before it acts.
+// wccpd withdraws a command that isn't answered within about two seconds and may then write another one,
+// while tunneld is still reading the first. Therefore the inputs are read twice, and `command` before,
+// between and after: wccpd sets `command` to 0 before it changes an input, so if all agree and no 0 was seen,
+// the inputs belong to one command. After a thousand attempts (because there is no command any more, or wccpd
+// was interrupted while it wrote one) the reader uses what it has, and checks `command` again before it acts
+// on it.
 
 #include "platform/tunnel_mailbox.h"
 
@@ -35,7 +36,7 @@ bool wccp_attach_mailbox() {
     if (!block)
         return false;
     if (length < sizeof(wccp_tunnel_mailbox)) {
-        static std::atomic<bool> logged; // once: this is tried again and again
+        static std::atomic<bool> logged; // tunneld repeats this until it succeeds
         if (!logged.exchange(true))
             QV_LOG(LC_LOG_ERR, "Block %s has %lu bytes instead of %lu and is not used", WCCP_MAILBOX_NAME,
                    static_cast<unsigned long>(length),
@@ -48,12 +49,12 @@ bool wccp_attach_mailbox() {
     return true;
 }
 
-// Both sides end a command by an exchange: exactly one of them finds it in the slot.
+// Both sides end a command by an exchange, so exactly one of them finds it still there.
 bool wccp_withdraw_command(wccp_tunnel_mailbox *mailbox) {
     return mailbox->command.exchange(MAILBOX_IDLE, std::memory_order_acq_rel) != MAILBOX_IDLE;
 }
 
-// A socket for each time: a tunneld that has been restarted has bound a new one, and commands are rare.
+// A new socket for each call: commands are rare, and after a restart tunneld has a new socket at the path.
 void wccp_wake_tunneld() {
     const cancel_off_guard whole;
     const int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
