@@ -183,7 +183,9 @@ lc_status bn_binding_new_str_autoinval(bn_binding **out, const char *name, uint3
 
 // --- Reading
 
-static lc_status reach(const bn_binding *binding, uint32_t id, const bn_attrib **out) {
+namespace {
+
+lc_status reach(const bn_binding *binding, uint32_t id, const bn_attrib **out) {
     bn_attrib *attrib = nullptr;
     const lc_status status =
         binding->attributes ? bn_attrib_array_get(binding->attributes, id, &attrib) : LC_NULL;
@@ -197,6 +199,9 @@ static lc_status reach(const bn_binding *binding, uint32_t id, const bn_attrib *
     }
     return status;
 }
+
+} // namespace
+
 lc_status bn_binding_get_str(const bn_binding *binding, uint32_t id, uint32_t expected_type,
                              uint32_t *out_type_and_flags, char **out_text) {
     CHECK_NULL(out_text);

@@ -9,11 +9,15 @@
 #include "mgmt/bnode_rows.h"
 #include "mgmt/bnode_types.h"
 
-static lc_status text_given(char *text, char **out) {
+namespace {
+
+lc_status text_given(char *text, char **out) {
     CHECK_NULL(text);
     *out = text;
     return LC_OK;
 }
+
+} // namespace
 
 // --- IPv4 and IPv6
 
@@ -56,10 +60,16 @@ lc_status lc_str_to_ipprefix(const char *text, lc_ipprefix *out) {
     CHECK_CONDITION(bn_text_to_ipprefix(text, out) == LC_OK);
     return LC_OK;
 }
-static lc_status address_text(uint8_t family, const uint8_t *address, char *text, socklen_t size) {
+
+namespace {
+
+lc_status address_text(uint8_t family, const uint8_t *address, char *text, socklen_t size) {
     CHECK_NULL(inet_ntop(family == 6 ? AF_INET6 : AF_INET, address, text, size));
     return LC_OK;
 }
+
+} // namespace
+
 lc_status lc_ipaddr_to_str(const lc_ipaddr *value, char **out) {
     CHECK_NULL(out);
     *out = nullptr;
@@ -90,8 +100,10 @@ int lc_ipprefix_compare(const lc_ipprefix *a, const lc_ipprefix *b) {
 
 // --- IPv4, as a number in host order
 
+namespace {
+
 // Reads four decimal numbers separated by dots; `out_rest` points to what follows.
-static lc_status read_ipv4(const char *text, uint32_t *out, const char **out_rest) {
+lc_status read_ipv4(const char *text, uint32_t *out, const char **out_rest) {
     *out = 0;
     for (int part = 0; part < 4; part++) {
         if (part > 0 && *text++ != '.')
@@ -108,6 +120,9 @@ static lc_status read_ipv4(const char *text, uint32_t *out, const char **out_res
     *out_rest = text;
     return LC_OK;
 }
+
+} // namespace
+
 lc_status lc_str_to_ipv4addr(const char *text, uint32_t *out) {
     CHECK_NULL(out);
     *out = 0;

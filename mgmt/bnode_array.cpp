@@ -14,31 +14,36 @@
 #include "runtime/guards.h"
 #include "runtime/hash_table.h"
 
-static lc_status binding_dup_for_array(const void *element, void **out_copy) {
+namespace {
+
+lc_status binding_dup_for_array(const void *element, void **out_copy) {
     bn_binding *copy = nullptr;
     CHECK_STATUS(bn_binding_dup(static_cast<const bn_binding *>(element), &copy));
     *out_copy = copy;
     return LC_OK;
 }
-static void binding_free_for_array(void *element) {
+void binding_free_for_array(void *element) {
     bn_release_binding(static_cast<bn_binding *>(element));
 }
-static int compare_by_name(const void *a, const void *b) {
+int compare_by_name(const void *a, const void *b) {
     const auto *left = *static_cast<const bn_binding *const *>(a);
     const auto *right = *static_cast<const bn_binding *const *>(b);
     return ts_cmp(left ? left->name : nullptr, right ? right->name : nullptr);
 }
-static uint32_t hash_name(const void *element) {
+uint32_t hash_name(const void *element) {
     const tstring *name = static_cast<const bn_binding *>(element)->name;
     return ht_hash_string_func(name->buffer, static_cast<uint32_t>(name->length));
 }
-static void binding_options(array_options *options) {
+void binding_options(array_options *options) {
     options->compare = compare_by_name;
     options->duplicate = binding_dup_for_array;
     options->free = binding_free_for_array;
     options->hash = hash_name;
     options->key_changes = &bn_binding_renames;
 }
+
+} // namespace
+
 TYPED_ARRAY_DEFINE(bn_binding_array, bn_binding *, binding_options)
 
 lc_status bn_binding_array_new_sized(bn_binding_array **out, uint32_t count) {
@@ -105,6 +110,7 @@ lc_status bn_binding_array_get_value_tstr_by_name(const bn_binding_array *array,
 }
 
 namespace {
+
 // "prefix/relative", in a buffer on the stack if it fits. `text` is null without memory or with a null
 // argument.
 struct relative_name {
@@ -123,6 +129,7 @@ struct relative_name {
     relative_name &operator=(const relative_name &) = delete;
     ~relative_name() { free(heap); }
 };
+
 } // namespace
 
 lc_status bn_binding_array_get_binding_by_name_rel(const bn_binding_array *array, const char *prefix,
@@ -146,6 +153,7 @@ lc_status bn_binding_array_get_value_tstr_by_name_rel(const bn_binding_array *ar
 // --- By pattern
 
 namespace {
+
 // The state of a search for the names that match a pattern, in the order of the array.
 struct pattern_walk {
     const bn_binding_array *array = nullptr;
@@ -154,10 +162,8 @@ struct pattern_walk {
     uint32_t next = 0;
     bool in_order = false;
 };
-} // namespace
 
-static lc_status begin_walk(pattern_walk *walk, const bn_binding_array *array, const char *pattern,
-                            uint32_t first) {
+lc_status begin_walk(pattern_walk *walk, const bn_binding_array *array, const char *pattern, uint32_t first) {
     CHECK_NULL(array);
     CHECK_NULL(pattern);
     CHECK_STATUS(bn_pattern_init(&walk->pattern, pattern));
@@ -181,7 +187,7 @@ static lc_status begin_walk(pattern_walk *walk, const bn_binding_array *array, c
     return LC_OK;
 }
 
-static const bn_binding *next_match(pattern_walk *walk, uint32_t *out_index) {
+const bn_binding *next_match(pattern_walk *walk, uint32_t *out_index) {
     while (walk->next < walk->array->list->length) {
         const uint32_t index = walk->next++;
         const bn_binding *binding = bn_binding_array_get_quick(walk->array, index);
@@ -203,6 +209,8 @@ static const bn_binding *next_match(pattern_walk *walk, uint32_t *out_index) {
     }
     return nullptr;
 }
+
+} // namespace
 
 lc_status bn_binding_array_get_first_matching_binding(const bn_binding_array *array, const char *pattern,
                                                       uint32_t start, int32_t *out_index,

@@ -17,14 +17,20 @@ lc_status bn_attrib_new(bn_attrib **out) {
     (*out)->attribute_id = bn_attrib_none;
     return LC_OK;
 }
-static bool owns_text(const bn_attrib *attrib) {
+
+namespace {
+
+bool owns_text(const bn_attrib *attrib) {
     const bn_type_row *row = bn_type_find(attrib->type);
     return row && row->shape == value_shape::text;
 }
-static bool owns_binary(const bn_attrib *attrib) {
+bool owns_binary(const bn_attrib *attrib) {
     const bn_type_row *row = bn_type_find(attrib->type);
     return row && row->shape == value_shape::binary;
 }
+
+} // namespace
+
 lc_status bn_attrib_free_value(bn_attrib *attrib) {
     CHECK_NULL(attrib);
     if (owns_text(attrib))
@@ -84,7 +90,9 @@ lc_status bn_attrib_get_type(const bn_attrib *attrib, uint32_t *out_type, uint32
     return LC_OK;
 }
 
-static int compare(const bn_attrib *a, const bn_attrib *b) {
+namespace {
+
+int compare(const bn_attrib *a, const bn_attrib *b) {
     if (!a || !b)
         return (a ? 0 : 1) - (b ? 0 : 1);
     const bool a_invalid = a->type_flags & bn_flag_invalid, b_invalid = b->type_flags & bn_flag_invalid;
@@ -95,6 +103,9 @@ static int compare(const bn_attrib *a, const bn_attrib *b) {
     const bn_type_row *row = bn_type_find(a->type);
     return row ? bn_value_compare(row, a, b) : 0;
 }
+
+} // namespace
+
 lc_status bn_attrib_compare(const bn_attrib *a, const bn_attrib *b, int *out_result) {
     CHECK_NULL(out_result);
     *out_result = compare(a, b);
@@ -103,15 +114,17 @@ lc_status bn_attrib_compare(const bn_attrib *a, const bn_attrib *b, int *out_res
 
 // --- Setting
 
+namespace {
+
 // Frees the old value and sets everything but the new one.
-static void begin(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags) {
+void begin(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags) {
     (void)bn_attrib_free_value(attrib);
     attrib->attribute_id = id;
     attrib->type = type;
     attrib->type_flags = flags & ~BN_TYPE_MASK;
 }
-static lc_status set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags, const void *value,
-                           uint32_t size) {
+lc_status set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags, const void *value,
+                    uint32_t size) {
     CHECK_NULL(attrib);
     CHECK_NULL(value);
     CHECK_CONDITION(bn_attrib_id_valid(id));
@@ -121,6 +134,9 @@ static lc_status set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uint32
     attrib->value_size = size;
     return LC_OK;
 }
+
+} // namespace
+
 // The conversion writes to a temporary attribute, so that the old value survives a text that can't be
 // converted.
 lc_status bn_attrib_set_str(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags, const char *text) {
@@ -167,12 +183,17 @@ lc_status bn_attrib_new_str(bn_attrib **out, uint32_t id, uint32_t type, uint32_
 
 // --- Getting
 
-static void tell(const bn_attrib *attrib, uint32_t *out_id, uint32_t *out_type_and_flags) {
+namespace {
+
+void tell(const bn_attrib *attrib, uint32_t *out_id, uint32_t *out_type_and_flags) {
     if (out_id)
         *out_id = attrib->attribute_id;
     if (out_type_and_flags)
         *out_type_and_flags = attrib->type | attrib->type_flags;
 }
+
+} // namespace
+
 lc_status bn_attrib_get_str(const bn_attrib *attrib, uint32_t *out_id, uint32_t expected_type,
                             uint32_t *out_type_and_flags, char **out_text) {
     CHECK_NULL(out_text);
@@ -214,8 +235,10 @@ lc_status bn_attrib_get_tbuf_const(const bn_attrib *attrib, uint32_t *out_id, ui
 
 // --- The typed operations
 
-static lc_status read_fixed(const bn_attrib *attrib, uint32_t type, uint32_t *out_id,
-                            uint32_t *out_type_and_flags, void *value, uint32_t size) {
+namespace {
+
+lc_status read_fixed(const bn_attrib *attrib, uint32_t type, uint32_t *out_id, uint32_t *out_type_and_flags,
+                     void *value, uint32_t size) {
     CHECK_NULL(attrib);
     if (attrib->type != type) {
         LC_LOG(LC_LOG_ERR, "Tried to get a %s attribute as a %s",
@@ -229,8 +252,7 @@ static lc_status read_fixed(const bn_attrib *attrib, uint32_t type, uint32_t *ou
 }
 
 // The attribute in a slot of a binding; null if the slot is empty.
-static lc_status slot_of(const bn_binding *binding, uint32_t id, uint32_t *out_type_and_flags,
-                         bn_attrib **out) {
+lc_status slot_of(const bn_binding *binding, uint32_t id, uint32_t *out_type_and_flags, bn_attrib **out) {
     *out = nullptr;
     if (out_type_and_flags)
         *out_type_and_flags = 0;
@@ -241,8 +263,8 @@ static lc_status slot_of(const bn_binding *binding, uint32_t id, uint32_t *out_t
     CHECK_STATUS(bn_attrib_array_get(binding->attributes, id, out));
     return LC_OK;
 }
-static lc_status make_fixed(bn_attrib **out, uint32_t id, uint32_t type, uint32_t flags, const void *value,
-                            uint32_t size) {
+lc_status make_fixed(bn_attrib **out, uint32_t id, uint32_t type, uint32_t flags, const void *value,
+                     uint32_t size) {
     CHECK_NULL(out);
     *out = nullptr;
     owned<bn_attrib, bn_release_attrib> attrib;
@@ -251,15 +273,15 @@ static lc_status make_fixed(bn_attrib **out, uint32_t id, uint32_t type, uint32_
     *out = attrib.take();
     return LC_OK;
 }
-static lc_status put_fixed(bn_binding *binding, uint32_t id, uint32_t type, uint32_t flags, const void *value,
-                           uint32_t size) {
+lc_status put_fixed(bn_binding *binding, uint32_t id, uint32_t type, uint32_t flags, const void *value,
+                    uint32_t size) {
     owned<bn_attrib, bn_release_attrib> attrib;
     CHECK_STATUS(make_fixed(&attrib.pointer, id, type, flags, value, size));
     CHECK_STATUS(bn_binding_set_attrib_takeover(binding, &attrib.pointer));
     return LC_OK;
 }
-static lc_status name_fixed(bn_binding **out, const char *name, uint32_t id, uint32_t type, uint32_t flags,
-                            const void *value, uint32_t size) {
+lc_status name_fixed(bn_binding **out, const char *name, uint32_t id, uint32_t type, uint32_t flags,
+                     const void *value, uint32_t size) {
     CHECK_NULL(out);
     *out = nullptr;
     owned<bn_binding, bn_release_binding> binding;
@@ -269,27 +291,29 @@ static lc_status name_fixed(bn_binding **out, const char *name, uint32_t id, uin
     return LC_OK;
 }
 
-static lc_ipv6addr bn_join_halves(uint64_t first, uint64_t last) {
+lc_ipv6addr bn_join_halves(uint64_t first, uint64_t last) {
     lc_ipv6addr joined;
     memcpy(joined.bytes, &first, sizeof first);
     memcpy(joined.bytes + sizeof first, &last, sizeof last);
     return joined;
 }
 template <typename Value>
-static void bn_give_plain(Value *out, const Value &stored) {
+void bn_give_plain(Value *out, const Value &stored) {
     if (out)
         *out = stored;
 }
-static void bn_give_halves(uint64_t *out_first, uint64_t *out_last, const lc_ipv6addr &stored) {
+void bn_give_halves(uint64_t *out_first, uint64_t *out_last, const lc_ipv6addr &stored) {
     if (out_first)
         memcpy(out_first, stored.bytes, sizeof *out_first);
     if (out_last)
         memcpy(out_last, stored.bytes + sizeof *out_first, sizeof *out_last);
 }
 template <typename Value>
-static const Value *bn_at(const Value &value) {
+const Value *bn_at(const Value &value) {
     return &value;
 }
+
+} // namespace
 
 // Defines bn_attrib_set_uint32, bn_attrib_new_uint32, bn_attrib_get_uint32, bn_binding_set_uint32,
 // bn_binding_new_uint32 and bn_binding_get_uint32, and the same for the other types of BN_VALUE_TYPES. The

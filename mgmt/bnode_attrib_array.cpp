@@ -8,23 +8,27 @@
 #include "mgmt/bnode_block.h"
 #include "runtime/guards.h"
 
+namespace {
+
 // The index of the first filled slot whose id is not less than `id`.
-static uint32_t place_of(const bn_attrib_array *array, uint32_t id) {
+uint32_t place_of(const bn_attrib_array *array, uint32_t id) {
     uint32_t at = 0;
     while (at < array->count && array->slots[at].id < id)
         at++;
     return at;
 }
-static bn_attrib *attrib_at(const bn_attrib_array *array, uint32_t id) {
+bn_attrib *attrib_at(const bn_attrib_array *array, uint32_t id) {
     const uint32_t at = place_of(array, id);
     return at < array->count && array->slots[at].id == id ? array->slots[at].attrib : nullptr;
 }
-static void free_slot(bn_attrib_slot *slot) {
+void free_slot(bn_attrib_slot *slot) {
     if (slot->placed)
         (void)bn_attrib_free_value(slot->attrib);
     else
         (void)bn_attrib_free(&slot->attrib);
 }
+
+} // namespace
 
 lc_status bn_attrib_array_new_full(bn_attrib_array **out, const array_options *) {
     CHECK_NULL(out);
@@ -53,7 +57,9 @@ void bn_attrib_array_release(bn_attrib_array *array) {
     (void)bn_attrib_array_free(&array);
 }
 
-static lc_status make_room(bn_attrib_array *array, uint32_t count) {
+namespace {
+
+lc_status make_room(bn_attrib_array *array, uint32_t count) {
     if (count <= array->capacity)
         return LC_OK;
     const uint32_t capacity = std::max(count, array->capacity * 2);
@@ -67,6 +73,9 @@ static lc_status make_room(bn_attrib_array *array, uint32_t count) {
     array->capacity = capacity;
     return LC_OK;
 }
+
+} // namespace
+
 lc_status bn_attrib_array_duplicate(const bn_attrib_array *array, bn_attrib_array **out) {
     CHECK_NULL(out);
     *out = nullptr;
@@ -100,7 +109,9 @@ lc_status bn_attrib_array_get(const bn_attrib_array *array, uint32_t id, bn_attr
     return LC_OK;
 }
 
-static lc_status put(bn_attrib_array *array, uint32_t id, bn_attrib *attrib, bool placed) {
+namespace {
+
+lc_status put(bn_attrib_array *array, uint32_t id, bn_attrib *attrib, bool placed) {
     CHECK_CONDITION(id <= array_size_max);
     const uint32_t at = place_of(array, id);
     const bool filled = at < array->count && array->slots[at].id == id;
@@ -123,6 +134,9 @@ static lc_status put(bn_attrib_array *array, uint32_t id, bn_attrib *attrib, boo
     array->length = std::max(array->length, id + 1);
     return LC_OK;
 }
+
+} // namespace
+
 lc_status bn_attrib_array_set_takeover(bn_attrib_array *array, uint32_t id, bn_attrib **inout) {
     CHECK_NULL(array);
     CHECK_NULL(inout);

@@ -25,17 +25,20 @@
 
 constexpr uint32_t HEADER_SIZE = 16, TYPE_OFFSET = 8;
 constexpr uint32_t ADDRESS_SIZE = 16;
-static constexpr uint32_t stored_address = offsetof(lc_ipaddr, address);
+
+namespace {
+
+constexpr uint32_t stored_address = offsetof(lc_ipaddr, address);
 static_assert(stored_address == offsetof(lc_ipprefix, address));
 static_assert(offsetof(lc_ipprefix, family) == 0 && offsetof(lc_ipprefix, mask_length) == 1);
 
-static bool has_value(uint32_t flags) {
+bool has_value(uint32_t flags) {
     return !(flags & bn_flag_no_value);
 }
 
 // Converts between stored bytes (little-endian) and wire bytes by reversing them. The mask length that
 // follows the address in an ipv6prefix stays in its place.
-static void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
+void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
     static_assert(std::endian::native == std::endian::little);
     const uint32_t turned = std::min(size, ADDRESS_SIZE);
     std::reverse_copy(from, from + turned, to);
@@ -44,19 +47,18 @@ static void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
 
 // --- Writing
 
-static lc_status put_number(tbuffer *buffer, uint32_t offset, uint32_t value) {
+lc_status put_number(tbuffer *buffer, uint32_t offset, uint32_t value) {
     return tb_put_uint32(buffer, offset, raw_word(to_be32(value)));
 }
 // This and put_value write to the buffer and return the number of bytes written in `out`.
-static lc_status put_sized(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t size,
-                           uint32_t *out) {
+lc_status put_sized(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t size, uint32_t *out) {
     CHECK_STATUS(put_number(buffer, offset, size));
     CHECK_STATUS(tb_put_buf(buffer, offset + 4, bytes, size));
     *out = 4 + size;
     return LC_OK;
 }
-static lc_status put_value(const bn_type_row *row, const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
-                           uint32_t *out) {
+lc_status put_value(const bn_type_row *row, const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
+                    uint32_t *out) {
     if (row->shape == value_shape::text) {
         const tstring *text = attrib->value.string;
         const uint32_t length = text ? static_cast<uint32_t>(text->length) : 0;
@@ -81,6 +83,9 @@ static lc_status put_value(const bn_type_row *row, const bn_attrib *attrib, tbuf
         memcpy(bytes, attrib->value.bytes, size);
     return put_sized(buffer, offset, bytes, size, out);
 }
+
+} // namespace
+
 lc_status bn_wire_write(const bn_attrib *attrib, tbuffer *buffer, uint32_t offset, uint32_t *out_written) {
     CHECK_NULL(attrib);
     CHECK_NULL(buffer);
@@ -112,11 +117,16 @@ lc_status bn_attrib_append_wire(const bn_attrib *attrib, tbuffer *buffer) {
 
 // --- Reading
 
-static uint32_t number_at(const uint8_t *bytes) {
+namespace {
+
+uint32_t number_at(const uint8_t *bytes) {
     be32 wire;
     memcpy(wire.bytes, bytes, sizeof wire);
     return to_host(wire);
 }
+
+} // namespace
+
 lc_status bn_check_text(const uint8_t *bytes, uint32_t length) {
     const void *nul = length ? memchr(bytes, 0, length) : nullptr;
     if (!nul)
@@ -125,7 +135,10 @@ lc_status bn_check_text(const uint8_t *bytes, uint32_t length) {
            static_cast<uint32_t>(static_cast<const uint8_t *>(nul) - bytes));
     return LC_ASSERTION;
 }
-static lc_status check_type(uint32_t found, uint32_t expected) {
+
+namespace {
+
+lc_status check_type(uint32_t found, uint32_t expected) {
     if (found == expected || found == 0)
         return LC_OK;
     LC_LOG(LC_LOG_ERR, "Attribute of type %s, expected %s",
@@ -135,7 +148,7 @@ static lc_status check_type(uint32_t found, uint32_t expected) {
 }
 // Locates the value. `at` is what follows the 16 bytes of the head, and `rest` the number of bytes from there
 // to the end of the buffer.
-static lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t rest) {
+lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t rest) {
     const bn_type_row *row = out->row;
     if (row->wire.leading) {
         out->value = at;
@@ -160,6 +173,9 @@ static lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t r
     CHECK_CONDITION(out->length <= rest);
     return LC_OK;
 }
+
+} // namespace
+
 lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_wire_attrib *out) {
     CHECK_NULL(buffer);
     CHECK_CONDITION(offset <= buffer->length && HEADER_SIZE <= buffer->length - offset);
@@ -184,7 +200,10 @@ lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, 
 bool bn_wire_has_text(const bn_wire_attrib *found) {
     return found->row->wire.kind == wire_kind_counted && has_value(found->flags);
 }
-static void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
+
+namespace {
+
+void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
     const uint32_t leading = found->row->wire.leading;
     if (!(found->flags & bn_flag_absent))
         out->value_size = found->row->size;
@@ -200,10 +219,13 @@ static void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
     }
 }
 // A text of type utf8_string that isn't valid UTF-8 is logged and kept, without the mark.
-static void mark_utf8(bn_attrib *attrib) {
+void mark_utf8(bn_attrib *attrib) {
     if (attrib->type == bn_type_utf8_string)
         LOG_STATUS(ts_set_utf8(attrib->value.string, 1));
 }
+
+} // namespace
+
 void bn_wire_fill(const bn_wire_attrib *found, char *text, bn_attrib *out) {
     out->attribute_id = found->id;
     out->type = found->row->number;
@@ -216,7 +238,9 @@ void bn_wire_fill(const bn_wire_attrib *found, char *text, bn_attrib *out) {
     }
 }
 
-static lc_status take_copy(const bn_wire_attrib *found, bn_attrib *attrib) {
+namespace {
+
+lc_status take_copy(const bn_wire_attrib *found, bn_attrib *attrib) {
     owned_text bytes(static_cast<char *>(malloc(size_t{found->length} + 1)));
     CHECK_NULL(bytes.pointer);
     memcpy(bytes.pointer, found->value, found->length);
@@ -234,6 +258,9 @@ static lc_status take_copy(const bn_wire_attrib *found, bn_attrib *attrib) {
     free(taken);
     return status;
 }
+
+} // namespace
+
 lc_status bn_wire_read(const tbuffer *buffer, uint32_t offset, uint32_t type, bn_attrib **out,
                        uint32_t *out_used) {
     CHECK_NULL(out);

@@ -47,20 +47,25 @@ void bn_size_binding(bn_block_size *size, size_t name_length, bool bare, uint32_
     }
 }
 
-static bool is_bare(const tstring *name) {
+namespace {
+
+bool is_bare(const tstring *name) {
     return name->length == 0 || (name->length == 1 && name->buffer[0] == '/');
 }
-static uint32_t attributes_of(const bn_binding *binding) {
+uint32_t attributes_of(const bn_binding *binding) {
     return binding->attributes ? binding->attributes->count : 0;
 }
-static const tstring *text_of(const bn_attrib *attrib) {
+const tstring *text_of(const bn_attrib *attrib) {
     const bn_type_row *row = bn_type_find(attrib->type);
     return row && row->shape == value_shape::text ? attrib->value.string : nullptr;
 }
-static const tbuffer *binary_of(const bn_attrib *attrib) {
+const tbuffer *binary_of(const bn_attrib *attrib) {
     const bn_type_row *row = bn_type_find(attrib->type);
     return row && row->shape == value_shape::binary ? attrib->value.binary : nullptr;
 }
+
+} // namespace
+
 void bn_size_copy(bn_block_size *size, const bn_binding *binding) {
     const uint32_t count = attributes_of(binding);
     bn_size_binding(size, static_cast<size_t>(binding->name->length), is_bare(binding->name), count);
@@ -111,7 +116,9 @@ lc_status bn_place_string(bn_block_builder *builder, const char *bytes, size_t l
     return LC_OK;
 }
 
-static lc_status place_bare(bn_block_builder *builder, size_t length, tstring **out) {
+namespace {
+
+lc_status place_bare(bn_block_builder *builder, size_t length, tstring **out) {
     tstring **shared = &builder->bare[length];
     if (!*shared)
         // Of length 0 or 1.
@@ -119,7 +126,7 @@ static lc_status place_bare(bn_block_builder *builder, size_t length, tstring **
     *out = *shared;
     return LC_OK;
 }
-static lc_status place_name(bn_block_builder *builder, size_t length, tstring **out, char **out_text) {
+lc_status place_name(bn_block_builder *builder, size_t length, tstring **out, char **out_text) {
     *out = static_cast<tstring *>(bn_place_record(builder, sizeof(tstring)));
     CHECK_NULL(*out);
     *out_text = bn_place_text(builder, length);
@@ -127,7 +134,7 @@ static lc_status place_name(bn_block_builder *builder, size_t length, tstring **
     ts_place(*out, *out_text, static_cast<int32_t>(length));
     return LC_OK;
 }
-static lc_status place_attributes(bn_block_builder *builder, uint32_t count, bn_attrib_array **out) {
+lc_status place_attributes(bn_block_builder *builder, uint32_t count, bn_attrib_array **out) {
     auto *array = static_cast<bn_attrib_array *>(bn_place_record(builder, sizeof(bn_attrib_array)));
     CHECK_NULL(array);
     array->slots = static_cast<bn_attrib_slot *>(bn_place_record(builder, count * sizeof(bn_attrib_slot)));
@@ -137,6 +144,9 @@ static lc_status place_attributes(bn_block_builder *builder, uint32_t count, bn_
     *out = array;
     return LC_OK;
 }
+
+} // namespace
+
 lc_status bn_place_binding(bn_block_builder *builder, size_t name_length, bool bare, bool absolute,
                            uint32_t attributes, bn_binding **out, char **out_name) {
     *out = nullptr;
@@ -163,7 +173,9 @@ bn_block *bn_block_of(bn_binding *binding) {
                                         binding->block_distance * GRAIN);
 }
 
-static lc_status place_value(bn_block_builder *builder, const bn_attrib *from, bn_attrib *to) {
+namespace {
+
+lc_status place_value(bn_block_builder *builder, const bn_attrib *from, bn_attrib *to) {
     const tstring *string = text_of(from);
     const tbuffer *binary = binary_of(from);
     if (!string && !binary) {
@@ -184,6 +196,9 @@ static lc_status place_value(bn_block_builder *builder, const bn_attrib *from, b
     }
     return LC_OK;
 }
+
+} // namespace
+
 lc_status bn_place_copy(bn_block_builder *builder, const bn_binding *binding, bn_binding **out) {
     const uint32_t count = attributes_of(binding);
     const tstring *name = binding->name;

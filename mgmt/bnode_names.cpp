@@ -15,8 +15,11 @@ const char *bn_part_end(const char *part) {
         part += bn_escapes(part);
     return part;
 }
+
+namespace {
+
 // Copies a part without its escapes, and adds a NUL. Returns the number of characters.
-static uint32_t copy_part(const char *part, const char *end, char *out) {
+uint32_t copy_part(const char *part, const char *end, char *out) {
     char *at = out;
     for (; part < end; part++) {
         part += bn_escapes(part);
@@ -26,12 +29,15 @@ static uint32_t copy_part(const char *part, const char *end, char *out) {
     return static_cast<uint32_t>(at - out);
 }
 // The number of parts of a name, without a leading separator; at least 1.
-static uint32_t parts_from(const char *name) {
+uint32_t parts_from(const char *name) {
     uint32_t count = 1;
     for (name = bn_part_end(name); *name; name = bn_part_end(name + 1))
         count++;
     return count;
 }
+
+} // namespace
+
 lc_status bn_binding_name_to_parts(const char *name, tstr_array **out_parts, int *out_absolute) {
     CHECK_NULL(out_parts);
     *out_parts = nullptr;
@@ -82,7 +88,9 @@ bn_pattern::~bn_pattern() {
     (void)tstr_array_free(&parts);
 }
 
-static bool part_equals(const char *name, const char *end, const tstring *part) {
+namespace {
+
+bool part_equals(const char *name, const char *end, const tstring *part) {
     const char *wanted = part->buffer;
     for (; name < end; name++, wanted++) {
         name += bn_escapes(name);
@@ -91,9 +99,11 @@ static bool part_equals(const char *name, const char *end, const tstring *part) 
     }
     return *wanted == 0;
 }
-static bool is_text(const tstring *part, const char *text) {
+bool is_text(const tstring *part, const char *text) {
     return strcmp(part->buffer, text) == 0;
 }
+
+} // namespace
 
 bool bn_pattern_matches(const bn_pattern *pattern, const char *name) {
     const uint32_t wanted_count = tstr_array_length_quick(pattern->parts);

@@ -77,29 +77,39 @@ void bn_response_node_free(bn_response_node *node) {
         free(node);
 }
 
-static void free_request_node(void *node) {
+namespace {
+
+void free_request_node(void *node) {
     bn_request_node_free(static_cast<bn_request_node *>(node));
 }
-static void free_response_node(void *node) {
+void free_response_node(void *node) {
     bn_response_node_free(static_cast<bn_response_node *>(node));
 }
-static void fill_request_nodes(array_options *options) {
+void fill_request_nodes(array_options *options) {
     options->free = free_request_node;
 }
-static void fill_response_nodes(array_options *options) {
+void fill_response_nodes(array_options *options) {
     options->free = free_response_node;
 }
+
+} // namespace
+
 TYPED_ARRAY_DEFINE(bn_request_per_node_array, bn_request_node *, fill_request_nodes)
 TYPED_ARRAY_DEFINE(bn_response_per_node_array, bn_response_node *, fill_response_nodes)
 
+namespace {
+
 // Options for an array that will have `count` elements.
-static array_options options_for(uint32_t count, void (*fill)(array_options *)) {
+array_options options_for(uint32_t count, void (*fill)(array_options *)) {
     array_options options = {};
     (void)array_options_get_defaults(&options);
     fill(&options);
     options.initial_size = count ? count : 1;
     return options;
 }
+
+} // namespace
+
 lc_status bn_request_nodes_new(bn_request_per_node_array **out, uint32_t count) {
     const array_options options = options_for(count, fill_request_nodes);
     return bn_request_per_node_array_new_full(out, &options);
@@ -140,7 +150,9 @@ lc_status bn_request_msg_create(bn_request_msg **out, uint16_t type) {
     return LC_OK;
 }
 
-static lc_status create_with_text(bn_request_msg **out, uint16_t type, const char *text) {
+namespace {
+
+lc_status create_with_text(bn_request_msg **out, uint16_t type, const char *text) {
     CHECK_NULL(out);
     *out = nullptr;
     owned_request msg;
@@ -150,6 +162,8 @@ static lc_status create_with_text(bn_request_msg **out, uint16_t type, const cha
     *out = msg.take();
     return LC_OK;
 }
+
+} // namespace
 
 lc_status bn_query_request_msg_create(bn_request_msg **out, uint32_t flags, const char *database) {
     CHECK_STATUS(create_with_text(out, bn_msg_query_request, database));
@@ -172,8 +186,10 @@ lc_status bn_event_request_msg_create(bn_request_msg **out, const char *event_na
     return LC_OK;
 }
 
-static lc_status append_node(bn_request_msg *msg, uint16_t type, uint32_t subop, uint32_t flags,
-                             bn_binding **inout_binding, uint32_t *out_node_id) {
+namespace {
+
+lc_status append_node(bn_request_msg *msg, uint16_t type, uint32_t subop, uint32_t flags,
+                      bn_binding **inout_binding, uint32_t *out_node_id) {
     if (out_node_id)
         *out_node_id = 0;
     CHECK_NULL(msg);
@@ -195,6 +211,8 @@ static lc_status append_node(bn_request_msg *msg, uint16_t type, uint32_t subop,
     return LC_OK;
 }
 
+} // namespace
+
 lc_status bn_query_request_msg_append_str(bn_request_msg *msg, uint32_t subop, uint32_t flags,
                                           const char *node_name, uint32_t *out_node_id) {
     CHECK_STATUS(
@@ -202,14 +220,18 @@ lc_status bn_query_request_msg_append_str(bn_request_msg *msg, uint32_t subop, u
     return LC_OK;
 }
 
+namespace {
+
 // Adds an attribute without a value for each of these ids.
-static lc_status ask_for_attributes(bn_binding *binding, const bn_attrib_array *attributes) {
+lc_status ask_for_attributes(bn_binding *binding, const bn_attrib_array *attributes) {
     const uint32_t count = bn_attrib_array_length_quick(attributes);
     for (uint32_t id = 0; id < count; id++)
         if (bn_attrib_array_get_quick(attributes, id))
             CHECK_STATUS(bn_binding_set_str(binding, id, bn_type_none, 0, ""));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status bn_query_request_msg_append_with_attribs(bn_request_msg *msg, uint32_t subop, uint32_t flags,
                                                    const char *node_name, const bn_attrib_array *attributes,
@@ -261,13 +283,19 @@ lc_status bn_event_request_msg_append_binding_takeover(bn_request_msg *msg, uint
     CHECK_STATUS(append_node(msg, bn_msg_event, 0, 0, inout_binding, out_node_id));
     return LC_OK;
 }
-static lc_status append_new_binding(bn_request_msg *msg, uint16_t msg_type, const char *name, uint32_t type,
-                                    const char *text, uint32_t *out_node_id) {
+
+namespace {
+
+lc_status append_new_binding(bn_request_msg *msg, uint16_t msg_type, const char *name, uint32_t type,
+                             const char *text, uint32_t *out_node_id) {
     owned_binding binding;
     CHECK_STATUS(bn_binding_new_str_autoinval(&binding.pointer, name, bn_attrib_value, type, 0, text));
     CHECK_STATUS(append_node(msg, msg_type, 0, 0, &binding.pointer, out_node_id));
     return LC_OK;
 }
+
+} // namespace
+
 lc_status bn_action_request_msg_append_new_binding(bn_request_msg *msg, uint32_t, const char *name,
                                                    uint32_t type, const char *text, uint32_t *out_node_id) {
     return append_new_binding(msg, bn_msg_action_request, name, type, text, out_node_id);
@@ -277,7 +305,9 @@ lc_status bn_event_request_msg_append_new_binding(bn_request_msg *msg, uint32_t,
     return append_new_binding(msg, bn_msg_event, name, type, text, out_node_id);
 }
 
-static lc_status get_text(const bn_request_msg *msg, uint16_t type, tstring **out) {
+namespace {
+
+lc_status get_text(const bn_request_msg *msg, uint16_t type, tstring **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(msg);
@@ -286,6 +316,9 @@ static lc_status get_text(const bn_request_msg *msg, uint16_t type, tstring **ou
         CHECK_STATUS(ts_dup(msg->text, out));
     return LC_OK;
 }
+
+} // namespace
+
 lc_status bn_action_request_msg_get_action_name(const bn_request_msg *msg, tstring **out) {
     CHECK_STATUS(get_text(msg, bn_msg_action_request, out));
     return LC_OK;
@@ -366,7 +399,9 @@ lc_status bn_query_response_msg_append_binding_takeover(bn_response_msg *msg, bn
     return LC_OK;
 }
 
-static lc_status copy_node(const bn_response_node *node, bn_block_builder *builder, bn_response_msg *out) {
+namespace {
+
+lc_status copy_node(const bn_response_node *node, bn_block_builder *builder, bn_response_msg *out) {
     owned_response_node copy(static_cast<bn_response_node *>(bn_place_record(builder, sizeof *node)));
     CHECK_NULL(copy.pointer);
     copy.pointer->placed = true;
@@ -379,7 +414,7 @@ static lc_status copy_node(const bn_response_node *node, bn_block_builder *build
     CHECK_STATUS(bn_response_per_node_array_append_takeover(out->nodes, &copy.pointer));
     return LC_OK;
 }
-static lc_status copy_nodes(const bn_response_msg *msg, bn_response_msg *out) {
+lc_status copy_nodes(const bn_response_msg *msg, bn_response_msg *out) {
     const uint32_t count = bn_response_per_node_array_length_quick(msg->nodes);
     CHECK_STATUS(bn_response_nodes_new(&out->nodes, count));
     bn_block_size size = {};
@@ -396,6 +431,9 @@ static lc_status copy_nodes(const bn_response_msg *msg, bn_response_msg *out) {
         CHECK_STATUS(copy_node(bn_response_per_node_array_get_quick(msg->nodes, i), &builder, out));
     return LC_OK;
 }
+
+} // namespace
+
 lc_status bn_response_msg_dup(const bn_response_msg *msg, bn_response_msg **out) {
     CHECK_NULL(out);
     *out = nullptr;
@@ -419,9 +457,11 @@ int32_t bn_request_get_msg_id(const bn_request_msg *msg) {
     return msg ? static_cast<int32_t>(msg->msg_id) : -1;
 }
 
+namespace {
+
 // Makes the parts of a name if the reader wants them, otherwise drops them. A name that has none ("" or "/")
 // gets none.
-static lc_status settle_parts(bn_binding *binding, int keep_parts) {
+lc_status settle_parts(bn_binding *binding, int keep_parts) {
     if (!keep_parts)
         return bn_binding_drop_name_parts(binding);
     const char *name = ts_str(binding->name);
@@ -430,15 +470,13 @@ static lc_status settle_parts(bn_binding *binding, int keep_parts) {
     return LC_OK;
 }
 
-namespace {
 // What is read from a message: bindings, and the ids of their nodes.
 struct reading {
     owned_bindings bindings;
     owned_uint32_array ids;
 };
-} // namespace
 
-static lc_status begin_reading(reading *into, uint32_t count) {
+lc_status begin_reading(reading *into, uint32_t count) {
     array_options options = {};
     CHECK_STATUS(array_options_get_defaults(&options));
     options.duplicate = array_std_assign_func;
@@ -447,14 +485,13 @@ static lc_status begin_reading(reading *into, uint32_t count) {
     CHECK_STATUS(bn_binding_array_new_sized(&into->bindings.pointer, count));
     return LC_OK;
 }
-static lc_status take_into(reading *into, bn_binding **inout_binding, int keep_parts) {
+lc_status take_into(reading *into, bn_binding **inout_binding, int keep_parts) {
     CHECK_STATUS(settle_parts(*inout_binding, keep_parts));
     CHECK_STATUS(bn_binding_array_append_takeover(into->bindings.pointer, inout_binding));
     return LC_OK;
 }
 template <typename NodeArray, typename Get>
-static lc_status copy_bindings(const NodeArray *nodes, uint32_t count, Get get, int keep_parts,
-                               reading *into) {
+lc_status copy_bindings(const NodeArray *nodes, uint32_t count, Get get, int keep_parts, reading *into) {
     bn_block_size size = {};
     for (uint32_t i = 0; i < count; i++)
         if (const bn_binding *binding = get(nodes, i)->binding)
@@ -474,6 +511,8 @@ static lc_status copy_bindings(const NodeArray *nodes, uint32_t count, Get get, 
     }
     return LC_OK;
 }
+
+} // namespace
 
 lc_status bn_request_get(const bn_request_msg *msg, uint16_t *out_type, const void **out_body, int keep_parts,
                          bn_binding_array **out_bindings, uint32_array **out_node_ids,
@@ -528,7 +567,9 @@ lc_status bn_response_get_msg_ids(const bn_response_msg *msg, uint32_t *out_resp
     return LC_OK;
 }
 
-static lc_status move_bindings(const bn_response_msg *msg, uint32_t count, int keep_parts, reading *into) {
+namespace {
+
+lc_status move_bindings(const bn_response_msg *msg, uint32_t count, int keep_parts, reading *into) {
     for (uint32_t i = 0; i < count; i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
         if (node->binding)
@@ -537,9 +578,8 @@ static lc_status move_bindings(const bn_response_msg *msg, uint32_t count, int k
     return LC_OK;
 }
 
-static lc_status read_response(const bn_response_msg *msg, bool take, uint32_t *out_code,
-                               tstring **out_message, int keep_parts, bn_binding_array **out_bindings,
-                               uint32_array **out_node_ids) {
+lc_status read_response(const bn_response_msg *msg, bool take, uint32_t *out_code, tstring **out_message,
+                        int keep_parts, bn_binding_array **out_bindings, uint32_array **out_node_ids) {
     if (out_code)
         *out_code = 0;
     if (out_message)
@@ -576,6 +616,8 @@ static lc_status read_response(const bn_response_msg *msg, bool take, uint32_t *
         *out_node_ids = read.ids.take();
     return LC_OK;
 }
+
+} // namespace
 
 lc_status bn_response_get_takeover(bn_response_msg *msg, uint32_t *out_code, tstring **out_message,
                                    int keep_parts, bn_binding_array **out_bindings,

@@ -7,6 +7,7 @@
 constexpr uint32_t DUMPED_NODES = 50;
 
 namespace {
+
 struct dump_target {
     int32_t level;
     const char *title;
@@ -15,30 +16,29 @@ struct dump_target {
 struct dump_names {
     const char *local_gap, *local, *peer_gap, *peer;
 };
-} // namespace
 #define DUMP(target, ...)                                                                                    \
     do {                                                                                                     \
         if (lc_log_check_level((target)->level))                                                             \
             (void)lc_log_internal(nullptr, nullptr, 0, 0, 0, (target)->level, __VA_ARGS__);                  \
     } while (0)
 
-static bool is_wanted(int32_t level) {
+bool is_wanted(int32_t level) {
     int32_t maximum = 0;
     return level != -1 && lc_log_get_max_log_level(&maximum) == LC_OK && maximum >= level;
 }
 
-static const char *text_or_empty(const tstring *text) {
+const char *text_or_empty(const tstring *text) {
     return text ? ts_str(text) : "";
 }
 
-static dump_names names_of(gcl_session *session) {
+dump_names names_of(gcl_session *session) {
     const char *local = nullptr, *peer = nullptr;
     if (session)
         (void)gcl_session_get_session_names(session, &local, &peer);
     return {local ? " " : "", local ? local : "", peer ? " " : "", peer ? peer : ""};
 }
 
-static void dump_count(const dump_target *to, uint32_t count) {
+void dump_count(const dump_target *to, uint32_t count) {
     if (count > DUMPED_NODES)
         DUMP(to, "%s: num nodes: %d (but only logging the first %d)", to->title, static_cast<int>(count),
              static_cast<int>(DUMPED_NODES));
@@ -46,7 +46,7 @@ static void dump_count(const dump_target *to, uint32_t count) {
         DUMP(to, "%s: num nodes: %d", to->title, static_cast<int>(count));
 }
 
-static void dump_attributes(const dump_target *to, uint32_t index, const bn_binding *binding) {
+void dump_attributes(const dump_target *to, uint32_t index, const bn_binding *binding) {
     const uint32_t slots = bn_attrib_array_length_quick(binding->attributes);
     for (uint32_t id = 0; id < slots; id++) {
         const bn_attrib *attribute = bn_attrib_array_get_quick(binding->attributes, id);
@@ -64,12 +64,12 @@ static void dump_attributes(const dump_target *to, uint32_t index, const bn_bind
     }
 }
 
-static void dump_node(const dump_target *to, uint32_t index, uint32_t id, const bn_binding *binding) {
+void dump_node(const dump_target *to, uint32_t index, uint32_t id, const bn_binding *binding) {
     DUMP(to, "%s: rn[%d]: id %d %s", to->title, static_cast<int>(index), static_cast<int>(id),
          bn_binding_get_name_quick(binding));
 }
 
-static void dump_subop(const dump_target *to, uint32_t index, const bn_request_node *node) {
+void dump_subop(const dump_target *to, uint32_t index, const bn_request_node *node) {
     const int32_t subop = static_cast<int32_t>(node->subop);
     if (node->msg_type == bn_msg_query_request)
         DUMP(to, "%s: rn[%d]: query subop: %s flags: %08x", to->title, static_cast<int>(index),
@@ -78,6 +78,8 @@ static void dump_subop(const dump_target *to, uint32_t index, const bn_request_n
         DUMP(to, "%s: rn[%d]: set subop: %s flags: %08x", to->title, static_cast<int>(index),
              lc_enum_to_string_quiet(bn_set_subop_table, subop), node->flags);
 }
+
+} // namespace
 
 void bn_request_msg_dump(gcl_session *session, const bn_request_msg *msg, int32_t level, const char *title) {
     if (!msg || !is_wanted(level))

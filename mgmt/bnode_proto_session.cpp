@@ -15,6 +15,7 @@
 #include "runtime/logging.h"
 
 namespace {
+
 struct bn_callback {
     bn_request_callback request; // of odd types
     bn_response_callback response;
@@ -34,26 +35,25 @@ struct bn_session_state {
     uint16_t service; // the session's bnode service, 0 until it is known
     bn_callback callbacks[MSG_TYPES];
 };
-} // namespace
 
-static bn_instance_state *instance_state(gcl *instance) {
+bn_instance_state *instance_state(gcl *instance) {
     gcl_body_protocol *protocol = gcl_get_body_protocol(instance, BN_PROTO);
     return protocol ? static_cast<bn_instance_state *>(protocol->state) : nullptr;
 }
-static bn_session_state *session_state(gcl_session *session) {
+bn_session_state *session_state(gcl_session *session) {
     return static_cast<bn_session_state *>(gcl_session_get_protocol_state(session, BN_PROTO));
 }
 
 // --- Callbacks
 
-static lc_status set_global(gcl *instance, uint16_t type, bn_callback callback) {
+lc_status set_global(gcl *instance, uint16_t type, bn_callback callback) {
     CHECK_NULL(instance);
     bn_instance_state *state = instance_state(instance);
     CHECK_NULL(state);
     state->callbacks[type] = callback;
     return LC_OK;
 }
-static lc_status set_session(gcl_session *session, uint16_t type, bn_callback callback) {
+lc_status set_session(gcl_session *session, uint16_t type, bn_callback callback) {
     CHECK_NULL(session);
     const gcl_session_guard guard(session);
     bn_session_state *state = session_state(session);
@@ -61,6 +61,8 @@ static lc_status set_session(gcl_session *session, uint16_t type, bn_callback ca
     state->callbacks[type] = callback;
     return LC_OK;
 }
+
+} // namespace
 
 // Define bn_set_global_callback_query_request_msg, bn_set_session_callback_query_request_msg and so on.
 #define BN_REQUEST_SETTERS(kind, type)                                                                       \
@@ -91,8 +93,10 @@ BN_RESPONSE_SETTERS(event_response, bn_msg_event_ack)
 
 // --- Sending
 
+namespace {
+
 // The service id of messages, which is the service that was opened last before the first message was sent.
-static uint16_t service_of(gcl_session *session) {
+uint16_t service_of(gcl_session *session) {
     bn_session_state *state = session_state(session);
     if (!state)
         return 0;
@@ -103,7 +107,7 @@ static uint16_t service_of(gcl_session *session) {
 
 // Sets the message id, and the service and transaction id if they aren't set.
 template <typename Message>
-static lc_status number_message(gcl_session *session, Message *msg) {
+lc_status number_message(gcl_session *session, Message *msg) {
     bn_instance_state *state = instance_state(gcl_session_get_instance(session));
     CHECK_NULL(state);
     msg->msg_id = state->next_msg_id++;
@@ -116,12 +120,11 @@ static lc_status number_message(gcl_session *session, Message *msg) {
     return LC_OK;
 }
 
-static bool is_connected(gcl_session *session) {
+bool is_connected(gcl_session *session) {
     int32_t state = GCL_SESSION_NONE;
     return gcl_session_get_state(session, &state, nullptr) == LC_OK && state == GCL_SESSION_CONNECTED;
 }
 
-namespace {
 // What differs between sending the two kinds of message.
 struct request_kind {
     static constexpr const char *title = "SEND REQ", *word = "request";
@@ -133,21 +136,20 @@ struct response_kind {
     static constexpr auto serialize = bn_response_msg_serialize;
     static constexpr auto dump = bn_response_msg_dump;
 };
-} // namespace
 
-static lc_status add_audit_user(gcl_session *session, bn_request_msg *msg) {
+lc_status add_audit_user(gcl_session *session, bn_request_msg *msg) {
     const bn_instance_state *state = instance_state(gcl_session_get_instance(session));
     const bool audited = msg->msg_type == bn_msg_set_request || msg->msg_type == bn_msg_action_request;
     if (audited && state->audit_user && !msg->audit_user)
         CHECK_STATUS(ts_dup(state->audit_user, &msg->audit_user));
     return LC_OK;
 }
-static lc_status add_audit_user(gcl_session *, bn_response_msg *) {
+lc_status add_audit_user(gcl_session *, bn_response_msg *) {
     return LC_OK;
 }
 
 template <typename Kind, typename Message>
-static lc_status send_message(gcl_session *session, Message *msg) {
+lc_status send_message(gcl_session *session, Message *msg) {
     CHECK_NULL(session);
     CHECK_NULL(msg);
     const gcl_session_guard guard(session);
@@ -170,7 +172,7 @@ static lc_status send_message(gcl_session *session, Message *msg) {
 }
 
 // Replaces a response that doesn't fit. Without any response the peer would wait until its timeout.
-static lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, lc_status reason) {
+lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, lc_status reason) {
     owned_response refusal;
     CHECK_STATUS(bn_response_msg_create(&refusal.pointer, msg->msg_type, msg->response_to, LC_NO_BUFFER_SPACE,
                                         reason == LC_NO_BUFFER_SPACE
@@ -185,6 +187,8 @@ static lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, 
     CHECK_STATUS(gcl_session_send_refusal_tb(session, BN_PROTO, msg->msg_type, &buffer.pointer));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg) {
     return send_message<request_kind>(session, msg);
@@ -201,14 +205,16 @@ lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg) {
 
 // --- Receiving
 
-static const char *const kind_words[] = {"query", "set", "action", "event"};
-static const char *kind_word(uint16_t type) {
+namespace {
+
+const char *const kind_words[] = {"query", "set", "action", "event"};
+const char *kind_word(uint16_t type) {
     return kind_words[(type - 1) / 2];
 }
 
 // The type in the frame header decides whether the body is a request or a response; the type in the message
 // decides which callback is called. False, logged, if one of them is not a message type.
-static bool check_types(gcl_session *session, uint16_t mtype, uint16_t msg_type) {
+bool check_types(gcl_session *session, uint16_t mtype, uint16_t msg_type) {
     for (const uint16_t type : {mtype, msg_type}) {
         if (type >= bn_msg_query_request && type <= bn_msg_event_ack)
             continue;
@@ -219,7 +225,7 @@ static bool check_types(gcl_session *session, uint16_t mtype, uint16_t msg_type)
     return true;
 }
 
-static lc_status receive_request(gcl_session *session, uint16_t mtype, tbuffer **inout_frame) {
+lc_status receive_request(gcl_session *session, uint16_t mtype, tbuffer **inout_frame) {
     owned_request msg;
     CHECK_STATUS(bn_request_msg_deserialize(*inout_frame, BN_FRAME_HEADER_BYTES, &msg.pointer));
     // The callback may run the loop for long; the frame's memory isn't needed any more.
@@ -241,7 +247,7 @@ static lc_status receive_request(gcl_session *session, uint16_t mtype, tbuffer *
     return LC_OK;
 }
 
-static lc_status receive_response(gcl_session *session, uint16_t mtype, tbuffer **inout_frame) {
+lc_status receive_response(gcl_session *session, uint16_t mtype, tbuffer **inout_frame) {
     constexpr int32_t HEADER_BYTES = 20;
     const int32_t id = gcl_session_get_id(session);
     CHECK_CONDITION(tb_length(*inout_frame) >= static_cast<int32_t>(BN_FRAME_HEADER_BYTES) + HEADER_BYTES);
@@ -274,8 +280,7 @@ static lc_status receive_response(gcl_session *session, uint16_t mtype, tbuffer 
     return LC_OK;
 }
 
-static lc_status receive_frame(gcl_session *session, gcl_body_protocol *protocol, tbuffer **inout_frame,
-                               void *) {
+lc_status receive_frame(gcl_session *session, gcl_body_protocol *protocol, tbuffer **inout_frame, void *) {
     CHECK_NULL(inout_frame);
     owned_tbuffer frame(*inout_frame);
     *inout_frame = nullptr;
@@ -294,7 +299,7 @@ static lc_status receive_frame(gcl_session *session, gcl_body_protocol *protocol
 
 // --- The protocol
 
-static lc_status session_new(gcl_session *session, gcl_body_protocol *protocol) {
+lc_status session_new(gcl_session *session, gcl_body_protocol *protocol) {
     const bn_instance_state *shared = static_cast<const bn_instance_state *>(protocol->state);
     CHECK_NULL(shared);
     owned<void, bn_free_memory> state(calloc(1, sizeof(bn_session_state)));
@@ -306,10 +311,12 @@ static lc_status session_new(gcl_session *session, gcl_body_protocol *protocol) 
     return LC_OK;
 }
 
-static lc_status session_free(gcl_session *session, gcl_body_protocol *) {
+lc_status session_free(gcl_session *session, gcl_body_protocol *) {
     free(session_state(session));
     return gcl_session_set_protocol_state(session, BN_PROTO, nullptr);
 }
+
+} // namespace
 
 lc_status gcl_bn_init(gcl *instance) {
     CHECK_NULL(instance);

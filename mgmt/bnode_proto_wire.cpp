@@ -23,6 +23,7 @@
 #include "runtime/logging.h"
 
 namespace {
+
 // The headers, which follow the frame header.
 struct bn_wire_request_header {
     be16 service_id;
@@ -43,24 +44,23 @@ static_assert(sizeof(bn_wire_request_header) == 16 && offsetof(bn_wire_request_h
 static_assert(offsetof(bn_wire_request_header, length) == 4 && offsetof(bn_wire_request_header, msg_id) == 8);
 static_assert(offsetof(bn_wire_request_header, transaction_id) == 12);
 static_assert(sizeof(bn_wire_response_header) == 20 && offsetof(bn_wire_response_header, response_to) == 16);
-} // namespace
 
-static void bn_byte_swap_request_header(const bn_request_msg *msg, bn_wire_request_header *out) {
+void bn_byte_swap_request_header(const bn_request_msg *msg, bn_wire_request_header *out) {
     *out = {to_be16(msg->service_id), to_be16(msg->msg_type), to_be32(msg->length), to_be32(msg->msg_id),
             to_be32(msg->transaction_id)};
 }
-static void bn_byte_swap_request_header(const bn_wire_request_header *wire, bn_request_msg *msg) {
+void bn_byte_swap_request_header(const bn_wire_request_header *wire, bn_request_msg *msg) {
     msg->service_id = to_host(wire->service_id);
     msg->msg_type = to_host(wire->msg_type);
     msg->length = to_host(wire->length);
     msg->msg_id = to_host(wire->msg_id);
     msg->transaction_id = to_host(wire->transaction_id);
 }
-static void bn_byte_swap_response_header(const bn_response_msg *msg, bn_wire_response_header *out) {
+void bn_byte_swap_response_header(const bn_response_msg *msg, bn_wire_response_header *out) {
     *out = {to_be16(msg->service_id), to_be16(msg->msg_type),       to_be32(msg->length),
             to_be32(msg->msg_id),     to_be32(msg->transaction_id), to_be32(msg->response_to)};
 }
-static void bn_byte_swap_response_header(const bn_wire_response_header *wire, bn_response_msg *msg) {
+void bn_byte_swap_response_header(const bn_wire_response_header *wire, bn_response_msg *msg) {
     msg->service_id = to_host(wire->service_id);
     msg->msg_type = to_host(wire->msg_type);
     msg->length = to_host(wire->length);
@@ -71,29 +71,29 @@ static void bn_byte_swap_response_header(const bn_wire_response_header *wire, bn
 
 // --- Writing
 
-static lc_status put_u32(tbuffer *buffer, uint32_t value) {
+lc_status put_u32(tbuffer *buffer, uint32_t value) {
     const be32 wire = to_be32(value);
     CHECK_STATUS(tb_append_buf(buffer, wire.bytes, sizeof wire));
     return LC_OK;
 }
-static lc_status put_u32_at(tbuffer *buffer, uint32_t offset, uint32_t value) {
+lc_status put_u32_at(tbuffer *buffer, uint32_t offset, uint32_t value) {
     const be32 wire = to_be32(value);
     CHECK_STATUS(tb_put_buf(buffer, offset, wire.bytes, sizeof wire));
     return LC_OK;
 }
-static lc_status put_string(tbuffer *buffer, const tstring *text) {
+lc_status put_string(tbuffer *buffer, const tstring *text) {
     const int32_t length = text ? ts_length(text) : 0;
     CHECK_STATUS(put_u32(buffer, static_cast<uint32_t>(length)));
     if (length > 0)
         CHECK_STATUS(tb_append_buf(buffer, ts_str(text), static_cast<uint32_t>(length)));
     return LC_OK;
 }
-static uint32_t used(const tbuffer *buffer) {
+uint32_t used(const tbuffer *buffer) {
     return static_cast<uint32_t>(tb_length(buffer));
 }
 
 // Writes one part of a name without its escapes, in runs of bytes that need no change.
-static lc_status put_escaped_part(tbuffer *buffer, const char *part, const char *end) {
+lc_status put_escaped_part(tbuffer *buffer, const char *part, const char *end) {
     const uint32_t length_at = used(buffer);
     CHECK_STATUS(put_u32(buffer, 0));
     const char *run = part;
@@ -108,7 +108,7 @@ static lc_status put_escaped_part(tbuffer *buffer, const char *part, const char 
 }
 // Splits the name while it writes it, since making an array of parts for each binding of a message would be
 // slow.
-static lc_status put_name_text(tbuffer *buffer, const char *name) {
+lc_status put_name_text(tbuffer *buffer, const char *name) {
     const bool absolute = *name == '/';
     CHECK_STATUS(tb_append_uint8(buffer, absolute));
     const uint32_t count_at = used(buffer);
@@ -127,7 +127,7 @@ static lc_status put_name_text(tbuffer *buffer, const char *name) {
     CHECK_STATUS(put_u32_at(buffer, count_at, count));
     return LC_OK;
 }
-static lc_status put_name(tbuffer *buffer, const bn_binding *binding) {
+lc_status put_name(tbuffer *buffer, const bn_binding *binding) {
     const tstr_array *parts = nullptr;
     int absolute = 0;
     CHECK_STATUS(bn_binding_get_name_parts_const(binding, &parts, &absolute));
@@ -141,7 +141,7 @@ static lc_status put_name(tbuffer *buffer, const bn_binding *binding) {
     return LC_OK;
 }
 
-static lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
+lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
     const uint32_t count_at = used(buffer);
     CHECK_STATUS(put_u32(buffer, 0));
     uint32_t written = 0;
@@ -159,22 +159,22 @@ static lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
 }
 
 // What is between the header and the nodes.
-static lc_status put_head(tbuffer *buffer, const bn_request_msg *msg) {
+lc_status put_head(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_string(buffer, msg->audit_user));
     return LC_OK;
 }
-static lc_status put_head(tbuffer *buffer, const bn_response_msg *msg) {
+lc_status put_head(tbuffer *buffer, const bn_response_msg *msg) {
     CHECK_STATUS(put_u32(buffer, msg->return_code));
     CHECK_STATUS(put_string(buffer, msg->return_message));
     return LC_OK;
 }
 
-static lc_status put_subop(tbuffer *buffer, const bn_request_node *node) {
+lc_status put_subop(tbuffer *buffer, const bn_request_node *node) {
     CHECK_STATUS(put_u32(buffer, node->subop));
     CHECK_STATUS(put_u32(buffer, node->flags));
     return LC_OK;
 }
-static lc_status put_set_node(tbuffer *buffer, const bn_request_node *node) {
+lc_status put_set_node(tbuffer *buffer, const bn_request_node *node) {
     CHECK_STATUS(put_subop(buffer, node));
     if (node->subop != bn_set_reparent)
         return LC_OK;
@@ -184,24 +184,23 @@ static lc_status put_set_node(tbuffer *buffer, const bn_request_node *node) {
 }
 // For a query the flags, database name and revision condition; for a set request the commit flags, text and
 // number.
-static lc_status put_options(tbuffer *buffer, const bn_request_msg *msg) {
+lc_status put_options(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_u32(buffer, msg->flags));
     CHECK_STATUS(put_string(buffer, msg->text));
     CHECK_STATUS(put_u32(buffer, msg->number));
     return LC_OK;
 }
-static lc_status put_message_name(tbuffer *buffer, const bn_request_msg *msg) {
+lc_status put_message_name(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_string(buffer, msg->text));
     return LC_OK;
 }
-static lc_status put_revision(tbuffer *buffer, const bn_response_msg *msg) {
+lc_status put_revision(tbuffer *buffer, const bn_response_msg *msg) {
     CHECK_STATUS(put_u32(buffer, msg->db_revision_id));
     return LC_OK;
 }
 
 // --- Reading
 
-namespace {
 struct wire_reader {
     const tbuffer *buffer;
     const uint8_t *at, *end;
@@ -211,24 +210,23 @@ struct wire_text {
     const uint8_t *bytes;
     uint32_t length;
 };
-} // namespace
 
-static size_t rest_of(const wire_reader *reader) {
+size_t rest_of(const wire_reader *reader) {
     return static_cast<size_t>(reader->end - reader->at);
 }
-static lc_status get_bytes(wire_reader *reader, void *out, size_t count) {
+lc_status get_bytes(wire_reader *reader, void *out, size_t count) {
     CHECK_CONDITION(count <= rest_of(reader));
     memcpy(out, reader->at, count);
     reader->at += count;
     return LC_OK;
 }
-static lc_status get_u32(wire_reader *reader, uint32_t *out) {
+lc_status get_u32(wire_reader *reader, uint32_t *out) {
     be32 wire = {};
     CHECK_STATUS(get_bytes(reader, wire.bytes, sizeof wire));
     *out = to_host(wire);
     return LC_OK;
 }
-static lc_status find_text(wire_reader *reader, wire_text *out) {
+lc_status find_text(wire_reader *reader, wire_text *out) {
     CHECK_STATUS(get_u32(reader, &out->length));
     if (out->length > rest_of(reader))
         CHECK_STATUS(LC_NO_BUFFER_SPACE);
@@ -236,14 +234,14 @@ static lc_status find_text(wire_reader *reader, wire_text *out) {
     reader->at += out->length;
     return LC_OK;
 }
-static lc_status find_string(wire_reader *reader, wire_text *out) {
+lc_status find_string(wire_reader *reader, wire_text *out) {
     CHECK_STATUS(find_text(reader, out));
     CHECK_STATUS(bn_check_text(out->bytes, out->length));
     CHECK_CONDITION(out->length < ts_size_max);
     return LC_OK;
 }
 // A null string is sent as one of length 0, and is received as an empty one.
-static lc_status get_string(wire_reader *reader, tstring **out) {
+lc_status get_string(wire_reader *reader, tstring **out) {
     wire_text found = {};
     CHECK_STATUS(find_string(reader, &found));
     CHECK_STATUS(ts_new_size(out, found.length + 1));
@@ -252,33 +250,32 @@ static lc_status get_string(wire_reader *reader, tstring **out) {
     return LC_OK;
 }
 
-static lc_status get_head(wire_reader *reader, bn_request_msg *msg) {
+lc_status get_head(wire_reader *reader, bn_request_msg *msg) {
     CHECK_STATUS(get_string(reader, &msg->audit_user));
     return LC_OK;
 }
-static lc_status get_head(wire_reader *reader, bn_response_msg *msg) {
+lc_status get_head(wire_reader *reader, bn_response_msg *msg) {
     CHECK_STATUS(get_u32(reader, &msg->return_code));
     CHECK_STATUS(get_string(reader, &msg->return_message));
     return LC_OK;
 }
-static lc_status get_options(wire_reader *reader, bn_request_msg *msg) {
+lc_status get_options(wire_reader *reader, bn_request_msg *msg) {
     CHECK_STATUS(get_u32(reader, &msg->flags));
     CHECK_STATUS(get_string(reader, &msg->text));
     CHECK_STATUS(get_u32(reader, &msg->number));
     return LC_OK;
 }
-static lc_status get_message_name(wire_reader *reader, bn_request_msg *msg) {
+lc_status get_message_name(wire_reader *reader, bn_request_msg *msg) {
     CHECK_STATUS(get_string(reader, &msg->text));
     return LC_OK;
 }
-static lc_status get_revision(wire_reader *reader, bn_response_msg *msg) {
+lc_status get_revision(wire_reader *reader, bn_response_msg *msg) {
     CHECK_STATUS(get_u32(reader, &msg->db_revision_id));
     return LC_OK;
 }
 
 // --- Reading nodes: measure_... are the first pass, place_... the second
 
-namespace {
 // A name in the buffer, and what it will be as text: its parts are escaped and joined. An absolute name
 // begins with a separator; if its first part is empty it has one already, and none is added.
 struct wire_name {
@@ -295,11 +292,10 @@ struct message_extent {
     bool escapes; // some name has a character that must be escaped
     bool checked; // the first pass is complete
 };
-} // namespace
 
 // Without a branch in the loop, so that the compiler can vectorise it: this looks at every byte of every
 // name.
-static bool has_special(const wire_text *part) {
+bool has_special(const wire_text *part) {
     bool special = false;
     for (uint32_t i = 0; i < part->length; i++) {
         const uint8_t byte = part->bytes[i];
@@ -310,7 +306,7 @@ static bool has_special(const wire_text *part) {
 // Writes a part with its escapes, and returns its length; with a null `out` it only counts. A backslash is
 // escaped before another backslash and before a slash, also before the separator that follows the part
 // (`separated`).
-static size_t write_escaped(const wire_text *part, bool separated, char *out) {
+size_t write_escaped(const wire_text *part, bool separated, char *out) {
     const uint8_t *at = part->bytes, *end = at + part->length;
     size_t length = 0;
     for (; at < end; at++) {
@@ -325,8 +321,7 @@ static size_t write_escaped(const wire_text *part, bool separated, char *out) {
     }
     return length;
 }
-static lc_status measure_part(const wire_text *part, bool separated, message_extent *extent,
-                              size_t *inout_length) {
+lc_status measure_part(const wire_text *part, bool separated, message_extent *extent, size_t *inout_length) {
     if (!extent->checked && has_special(part)) {
         CHECK_STATUS(bn_check_text(part->bytes, part->length));
         extent->escapes = true;
@@ -335,7 +330,7 @@ static lc_status measure_part(const wire_text *part, bool separated, message_ext
     return LC_OK;
 }
 // Reads the name and advances the reader past it.
-static lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *out) {
+lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *out) {
     uint8_t absolute = 0;
     CHECK_STATUS(get_bytes(reader, &absolute, sizeof absolute));
     CHECK_STATUS(get_u32(reader, &out->parts));
@@ -357,7 +352,7 @@ static lc_status measure_name(wire_reader *reader, message_extent *extent, wire_
     CHECK_CONDITION(out->length < ts_size_max);
     return LC_OK;
 }
-static lc_status write_name(const wire_reader *reader, const wire_name *name, bool escapes, char *out) {
+lc_status write_name(const wire_reader *reader, const wire_name *name, bool escapes, char *out) {
     wire_reader parts = {reader->buffer, name->first, reader->end};
     if (name->leading)
         *out++ = '/';
@@ -374,13 +369,13 @@ static lc_status write_name(const wire_reader *reader, const wire_name *name, bo
 }
 
 // Locates an attribute and advances the reader past it.
-static lc_status find_attribute(wire_reader *reader, bn_wire_attrib *out) {
+lc_status find_attribute(wire_reader *reader, bn_wire_attrib *out) {
     const auto offset = static_cast<uint32_t>(reader->at - reader->buffer->buffer);
     CHECK_STATUS(bn_wire_locate(reader->buffer, offset, 0, out));
     reader->at += out->used;
     return LC_OK;
 }
-static lc_status measure_binding(wire_reader *reader, message_extent *extent) {
+lc_status measure_binding(wire_reader *reader, message_extent *extent) {
     bn_block_size *size = &extent->size;
     wire_name name = {};
     uint32_t count = 0;
@@ -395,7 +390,7 @@ static lc_status measure_binding(wire_reader *reader, message_extent *extent) {
     bn_size_binding(size, name.length, name.bare, count);
     return LC_OK;
 }
-static lc_status place_attribute(wire_reader *reader, bn_block_builder *builder, bn_attrib_array *array) {
+lc_status place_attribute(wire_reader *reader, bn_block_builder *builder, bn_attrib_array *array) {
     bn_wire_attrib found = {};
     CHECK_STATUS(find_attribute(reader, &found));
     auto *attrib = static_cast<bn_attrib *>(bn_place_record(builder, sizeof(bn_attrib)));
@@ -410,8 +405,8 @@ static lc_status place_attribute(wire_reader *reader, bn_block_builder *builder,
     CHECK_STATUS(bn_attrib_array_put_placed(array, found.id, attrib));
     return LC_OK;
 }
-static lc_status place_binding(wire_reader *reader, message_extent *extent, bn_block_builder *builder,
-                               bn_binding **out) {
+lc_status place_binding(wire_reader *reader, message_extent *extent, bn_block_builder *builder,
+                        bn_binding **out) {
     wire_name name = {};
     uint32_t count = 0;
     CHECK_STATUS(measure_name(reader, extent, &name));
@@ -428,17 +423,17 @@ static lc_status place_binding(wire_reader *reader, message_extent *extent, bn_b
     return LC_OK;
 }
 
-static lc_status skip_subop(wire_reader *reader, uint32_t *out_subop) {
+lc_status skip_subop(wire_reader *reader, uint32_t *out_subop) {
     uint32_t flags = 0;
     CHECK_STATUS(get_u32(reader, out_subop));
     CHECK_STATUS(get_u32(reader, &flags));
     return LC_OK;
 }
-static lc_status measure_query_node(wire_reader *reader, bn_block_size *) {
+lc_status measure_query_node(wire_reader *reader, bn_block_size *) {
     uint32_t subop = 0;
     return skip_subop(reader, &subop);
 }
-static lc_status measure_set_node(wire_reader *reader, bn_block_size *size) {
+lc_status measure_set_node(wire_reader *reader, bn_block_size *size) {
     uint32_t subop = 0;
     CHECK_STATUS(skip_subop(reader, &subop));
     for (int i = 0; i < 2 && subop == bn_set_reparent; i++) {
@@ -449,18 +444,18 @@ static lc_status measure_set_node(wire_reader *reader, bn_block_size *size) {
     }
     return LC_OK;
 }
-static lc_status place_query_node(wire_reader *reader, bn_block_builder *, bn_request_node *node) {
+lc_status place_query_node(wire_reader *reader, bn_block_builder *, bn_request_node *node) {
     CHECK_STATUS(get_u32(reader, &node->subop));
     CHECK_STATUS(get_u32(reader, &node->flags));
     return LC_OK;
 }
-static lc_status place_string(wire_reader *reader, bn_block_builder *builder, tstring **out) {
+lc_status place_string(wire_reader *reader, bn_block_builder *builder, tstring **out) {
     wire_text text = {};
     CHECK_STATUS(find_string(reader, &text));
     CHECK_STATUS(bn_place_string(builder, reinterpret_cast<const char *>(text.bytes), text.length, out));
     return LC_OK;
 }
-static lc_status place_set_node(wire_reader *reader, bn_block_builder *builder, bn_request_node *node) {
+lc_status place_set_node(wire_reader *reader, bn_block_builder *builder, bn_request_node *node) {
     CHECK_STATUS(place_query_node(reader, builder, node));
     if (node->subop != bn_set_reparent)
         return LC_OK;
@@ -471,7 +466,6 @@ static lc_status place_set_node(wire_reader *reader, bn_block_builder *builder, 
 
 // --- The two kinds of message
 
-namespace {
 // How the trailers of a message type are written and read; null functions for a type without that trailer.
 template <typename Message, typename Node>
 struct message_trailers {
@@ -484,27 +478,25 @@ struct message_trailers {
 };
 using request_trailers = message_trailers<bn_request_msg, bn_request_node>;
 using response_trailers = message_trailers<bn_response_msg, bn_response_node>;
-} // namespace
-static const request_trailers request_types[] = {
+const request_trailers request_types[] = {
     {bn_msg_query_request, put_subop, measure_query_node, place_query_node, put_options, get_options},
     {bn_msg_set_request, put_set_node, measure_set_node, place_set_node, put_options, get_options},
     {bn_msg_action_request, nullptr, nullptr, nullptr, put_message_name, get_message_name},
     {bn_msg_event, nullptr, nullptr, nullptr, put_message_name, get_message_name},
 };
-static const response_trailers response_types[] = {
+const response_trailers response_types[] = {
     {bn_msg_query_response, nullptr, nullptr, nullptr, put_revision, get_revision},
     {bn_msg_set_response, nullptr, nullptr, nullptr, put_revision, get_revision},
 };
 
 template <typename Trailers, size_t Count>
-static Trailers find_trailers(const Trailers (&types)[Count], uint16_t type) {
+Trailers find_trailers(const Trailers (&types)[Count], uint16_t type) {
     for (const Trailers &known : types)
         if (known.msg_type == type)
             return known;
     return {};
 }
 
-namespace {
 struct request_kind {
     using message = bn_request_msg;
     using node = bn_request_node;
@@ -540,9 +532,8 @@ struct response_kind {
     static void swap(const message *msg, header *out) { bn_byte_swap_response_header(msg, out); }
     static void swap(const header *wire, message *out) { bn_byte_swap_response_header(wire, out); }
 };
-} // namespace
 
-static lc_status start_buffer(uint32_t header_bytes, owned_tbuffer *out) {
+lc_status start_buffer(uint32_t header_bytes, owned_tbuffer *out) {
     CHECK_STATUS(tb_new(&out->pointer));
     const uint8_t zero = 0;
     if (header_bytes > 0)
@@ -551,7 +542,7 @@ static lc_status start_buffer(uint32_t header_bytes, owned_tbuffer *out) {
 }
 
 template <typename Kind>
-static lc_status serialize(typename Kind::message *msg, uint32_t header_bytes, tbuffer **out) {
+lc_status serialize(typename Kind::message *msg, uint32_t header_bytes, tbuffer **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(msg);
@@ -590,8 +581,8 @@ static lc_status serialize(typename Kind::message *msg, uint32_t header_bytes, t
 }
 
 template <typename Kind, typename Trailers>
-static lc_status measure_nodes(wire_reader *reader, uint32_t count, const Trailers *trailers,
-                               message_extent *extent) {
+lc_status measure_nodes(wire_reader *reader, uint32_t count, const Trailers *trailers,
+                        message_extent *extent) {
     for (uint32_t i = 0; i < count; i++) {
         uint32_t node_id = 0;
         bn_size_record(&extent->size, sizeof(typename Kind::node));
@@ -604,8 +595,8 @@ static lc_status measure_nodes(wire_reader *reader, uint32_t count, const Traile
     return LC_OK;
 }
 template <typename Kind, typename Trailers>
-static lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers *trailers,
-                             message_extent *extent, typename Kind::message *msg) {
+lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers *trailers, message_extent *extent,
+                      typename Kind::message *msg) {
     bn_block_builder builder = {};
     CHECK_STATUS(bn_block_new(&extent->size, &builder));
     msg->block = builder.block;
@@ -626,7 +617,7 @@ static lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers
 
 // Nodes are allocated only after all of them and the message trailer have been checked.
 template <typename Kind>
-static lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Kind::message **out) {
+lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Kind::message **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(buffer);
@@ -653,6 +644,8 @@ static lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Ki
     *out = msg.take();
     return LC_OK;
 }
+
+} // namespace
 
 lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, tbuffer **out) {
     return serialize<request_kind>(msg, header_bytes, out);

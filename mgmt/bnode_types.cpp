@@ -58,12 +58,17 @@ lc_status bn_text_to_integer(const char *text, int64_t least, int64_t most, int6
     return errno || *end || *out < least || *out > most ? LC_BAD_TYPE : LC_OK;
 }
 
+namespace {
+
 template <typename Number>
-static Number loaded(const bn_attrib *attrib) {
+Number loaded(const bn_attrib *attrib) {
     Number value;
     memcpy(&value, attrib->value.bytes, sizeof value);
     return value;
 }
+
+} // namespace
+
 uint64_t bn_value_natural(const bn_type_row *row, const bn_attrib *attrib) {
     switch (row->size) {
     case 1:
@@ -84,58 +89,61 @@ int64_t bn_value_integer(const bn_type_row *row, const bn_attrib *attrib) {
     const int unused = 64 - 8 * row->size;
     return static_cast<int64_t>(value << unused) >> unused;
 }
-static void store_low(const bn_type_row *row, uint64_t value, bn_attrib *attrib) {
+
+namespace {
+
+void store_low(const bn_type_row *row, uint64_t value, bn_attrib *attrib) {
     static_assert(std::endian::native == std::endian::little);
     memcpy(attrib->value.bytes, &value, std::min<size_t>(row->size, sizeof value));
 }
 
-static lc_status text_given(char *text, char **out) {
+lc_status text_given(char *text, char **out) {
     CHECK_NULL(text);
     *out = text;
     return LC_OK;
 }
-static lc_status natural_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+lc_status natural_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
     return text_given(smprintf("%lu", bn_value_natural(row, attrib)), out);
 }
-static lc_status natural_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status natural_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     uint64_t value = 0;
     CHECK_QUIET(bn_text_to_natural(text, UINT64_MAX >> (64 - 8 * row->size), &value));
     store_low(row, value, attrib);
     return LC_OK;
 }
-static lc_status integer_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+lc_status integer_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
     return text_given(smprintf("%ld", bn_value_integer(row, attrib)), out);
 }
-static lc_status integer_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status integer_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     const int64_t most = INT64_MAX >> (64 - 8 * row->size);
     int64_t value = 0;
     CHECK_QUIET(bn_text_to_integer(text, -most - 1, most, &value));
     store_low(row, static_cast<uint64_t>(value), attrib);
     return LC_OK;
 }
-static lc_status bool_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+lc_status bool_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
     return text_given(safe_strdup(lc_bool_to_str(bn_value_natural(row, attrib) != 0)), out);
 }
-static lc_status bool_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status bool_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     int32_t value = 0;
     CHECK_QUIET(lc_str_to_bool(text, &value));
     store_low(row, value != 0, attrib);
     return LC_OK;
 }
 template <typename Real>
-static Real real_of(const char *text, char **end) {
+Real real_of(const char *text, char **end) {
     if constexpr (sizeof(Real) == sizeof(float))
         return strtof(text, end);
     else
         return strtod(text, end);
 }
 template <typename Real>
-static lc_status real_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+lc_status real_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
     const double value = static_cast<double>(loaded<Real>(attrib));
     return text_given(row->size == sizeof(float) ? smprintf("%.9f", value) : smprintf("%.18g", value), out);
 }
 template <typename Real>
-static lc_status real_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status real_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
     char *end = nullptr;
     errno = 0;
     const Real value = real_of<Real>(text, &end);
@@ -144,10 +152,10 @@ static lc_status real_in(const bn_type_row *, const char *text, bn_attrib *attri
     memcpy(attrib->value.bytes, &value, sizeof value);
     return LC_OK;
 }
-static lc_status char_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
+lc_status char_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
     return text_given(smprintf("%c", loaded<char>(attrib)), out);
 }
-static lc_status char_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status char_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
     if (strlen(text) != 1)
         return LC_BAD_TYPE;
     attrib->value.bytes[0] = static_cast<uint8_t>(text[0]);
@@ -155,14 +163,14 @@ static lc_status char_in(const bn_type_row *, const char *text, bn_attrib *attri
 }
 // A number that is written as a name. The row's form is the table of names; bn_type_table, which is derived
 // from the rows themselves, is used if it is null.
-static const lc_enum_entry *names_of(const bn_type_row *row) {
+const lc_enum_entry *names_of(const bn_type_row *row) {
     return row->form ? static_cast<const lc_enum_entry *>(row->form) : bn_type_table;
 }
-static lc_status named_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+lc_status named_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
     const auto value = static_cast<int32_t>(bn_value_natural(row, attrib));
     return text_given(safe_strdup(lc_enum_to_string_quiet(names_of(row), value)), out);
 }
-static lc_status named_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status named_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     int32_t value = 0;
     CHECK_QUIET(lc_string_to_enum(names_of(row), text, &value));
     store_low(row, static_cast<uint32_t>(value), attrib);
@@ -171,31 +179,29 @@ static lc_status named_in(const bn_type_row *row, const char *text, bn_attrib *a
 
 // --- Times. The row's form is a time_form.
 
-namespace {
 struct time_form {
     int64_t unit_us;
     lc_status (*to_str)(int64_t us, char **out);
     lc_status (*from_str)(const char *text, int64_t *out_us);
     bool plain_without_display; // durations are plain numbers unless bn_flag_display is set
 };
-} // namespace
-static lc_status datetime_to_str(int64_t us, char **out) {
+lc_status datetime_to_str(int64_t us, char **out) {
     return lt_datetime_us_to_str(us, 0, out);
 }
 constexpr int64_t SEC = 1000000, MS = 1000, US = 1;
 // Defines daytime_sec_form, daytime_ms_form and daytime_us_form for example.
 #define TIME_FORMS(kind, to, plain)                                                                          \
-    static constexpr time_form kind##_sec_form = {SEC, to, lt_str_to_##kind##_us, plain};                    \
-    static constexpr time_form kind##_ms_form = {MS, to, lt_str_to_##kind##_us, plain};                      \
-    static constexpr time_form kind##_us_form = {US, to, lt_str_to_##kind##_us, plain};
+    constexpr time_form kind##_sec_form = {SEC, to, lt_str_to_##kind##_us, plain};                    \
+    constexpr time_form kind##_ms_form = {MS, to, lt_str_to_##kind##_us, plain};                      \
+    constexpr time_form kind##_us_form = {US, to, lt_str_to_##kind##_us, plain};
 TIME_FORMS(daytime, lt_daytime_us_to_str, false)
 TIME_FORMS(datetime, datetime_to_str, false)
 TIME_FORMS(dur, lt_dur_us_to_str, true)
 
-static bool is_plain(const time_form *form, const bn_attrib *attrib) {
+bool is_plain(const time_form *form, const bn_attrib *attrib) {
     return form->plain_without_display && !(attrib->type_flags & bn_flag_display);
 }
-static lc_status time_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+lc_status time_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
     const auto *form = static_cast<const time_form *>(row->form);
     const bool natural = row->shape == value_shape::natural;
     if (is_plain(form, attrib))
@@ -207,7 +213,7 @@ static lc_status time_out(const bn_type_row *row, const bn_attrib *attrib, char 
     CHECK_STATUS(form->to_str(us, out));
     return LC_OK;
 }
-static lc_status time_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status time_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     const auto *form = static_cast<const time_form *>(row->form);
     const bool natural = row->shape == value_shape::natural;
     if (is_plain(form, attrib))
@@ -220,11 +226,11 @@ static lc_status time_in(const bn_type_row *row, const char *text, bn_attrib *at
     store_low(row, static_cast<uint64_t>(us / form->unit_us), attrib);
     return LC_OK;
 }
-static lc_status date_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
+lc_status date_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
     CHECK_STATUS(lt_date_to_str(loaded<lt_date>(attrib), out));
     return LC_OK;
 }
-static lc_status date_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status date_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     lt_date value = 0;
     CHECK_QUIET(lt_str_to_date(text, &value));
     store_low(row, value, attrib);
@@ -234,37 +240,37 @@ static lc_status date_in(const bn_type_row *row, const char *text, bn_attrib *at
 // --- Addresses
 
 template <typename Value, lc_status (*ToStr)(const Value *, char **)>
-static lc_status record_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
+lc_status record_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
     const Value value = loaded<Value>(attrib);
     CHECK_STATUS(ToStr(&value, out));
     return LC_OK;
 }
 template <typename Value, lc_status (*ToStr)(Value, char **)>
-static lc_status word_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
+lc_status word_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
     CHECK_STATUS(ToStr(loaded<Value>(attrib), out));
     return LC_OK;
 }
 template <typename Value, lc_status (*FromStr)(const char *, Value *)>
-static lc_status record_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status record_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
     Value value{};
     CHECK_QUIET(FromStr(text, &value));
     memcpy(attrib->value.bytes, &value, sizeof value);
     return LC_OK;
 }
-static lc_status ipv6_to_str(const lc_ipv6addr *value, char **out) {
+lc_status ipv6_to_str(const lc_ipv6addr *value, char **out) {
     char text[INET6_ADDRSTRLEN];
     CHECK_NULL(inet_ntop(AF_INET6, value->bytes, text, sizeof text));
     return text_given(safe_strdup(text), out);
 }
-static lc_status text_to_ipv6(const char *text, lc_ipv6addr *out) {
+lc_status text_to_ipv6(const char *text, lc_ipv6addr *out) {
     return inet_pton(AF_INET6, text, out->bytes) == 1 ? LC_OK : LC_BAD_TYPE;
 }
-static lc_status ipv6prefix_to_str(const lc_ipv6prefix *value, char **out) {
+lc_status ipv6prefix_to_str(const lc_ipv6prefix *value, char **out) {
     char text[INET6_ADDRSTRLEN];
     CHECK_NULL(inet_ntop(AF_INET6, value->address, text, sizeof text));
     return text_given(smprintf("%s/%u", text, value->mask_length), out);
 }
-static lc_status text_to_ipv6prefix(const char *text, lc_ipv6prefix *out) {
+lc_status text_to_ipv6prefix(const char *text, lc_ipv6prefix *out) {
     lc_ipprefix prefix{};
     if (!strchr(text, ':') || !strchr(text, '/') || bn_text_to_ipprefix(text, &prefix) != LC_OK)
         return LC_BAD_TYPE;
@@ -275,32 +281,32 @@ static lc_status text_to_ipv6prefix(const char *text, lc_ipv6prefix *out) {
 
 // --- Allocated values and none
 
-static lc_status none_out(const bn_type_row *, const bn_attrib *, char **out) {
+lc_status none_out(const bn_type_row *, const bn_attrib *, char **out) {
     return text_given(safe_strdup(""), out);
 }
-static lc_status none_in(const bn_type_row *, const char *, bn_attrib *) {
+lc_status none_in(const bn_type_row *, const char *, bn_attrib *) {
     return LC_OK;
 }
-static lc_status refuse_out(const bn_type_row *, const bn_attrib *, char **) {
+lc_status refuse_out(const bn_type_row *, const bn_attrib *, char **) {
     FAIL_WITH(LC_UNEXPECTED_CASE);
 }
-static lc_status refuse_in(const bn_type_row *, const char *, bn_attrib *) {
+lc_status refuse_in(const bn_type_row *, const char *, bn_attrib *) {
     FAIL_WITH(LC_UNEXPECTED_CASE);
 }
-static lc_status string_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
+lc_status string_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
     return text_given(safe_strdup(attrib->value.string ? attrib->value.string->buffer : ""), out);
 }
-static lc_status string_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status string_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
     CHECK_STATUS(ts_new_str(&attrib->value.string, text));
     attrib->value_size = static_cast<uint32_t>(ts_length(attrib->value.string));
     return LC_OK;
 }
-static lc_status utf8_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status utf8_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     CHECK_STATUS(string_in(row, text, attrib));
     const lc_status status = ts_set_utf8(attrib->value.string, 1);
     return status == LC_BAD_UTF8 ? LC_BAD_TYPE : status;
 }
-static lc_status hostname_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status hostname_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     if (text[0] == '-')
         return LC_BAD_TYPE;
     for (const char *at = text; *at; at++) // ASCII only; isalnum() depends on the locale
@@ -309,11 +315,11 @@ static lc_status hostname_in(const bn_type_row *row, const char *text, bn_attrib
             return LC_BAD_TYPE;
     return string_in(row, text, attrib);
 }
-static lc_status binary_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
+lc_status binary_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
     const tbuffer *bytes = attrib->value.binary;
     return text_given(safe_strdup(bytes ? reinterpret_cast<const char *>(bytes->buffer) : ""), out);
 }
-static lc_status binary_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status binary_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
     CHECK_STATUS(tb_new_buf(&attrib->value.binary, text, -1));
     attrib->value_size = static_cast<uint32_t>(tb_length(attrib->value.binary));
     return LC_OK;
@@ -322,7 +328,7 @@ static lc_status binary_in(const bn_type_row *, const char *text, bn_attrib *att
 // --- The table
 
 using shape = value_shape;
-static constexpr bn_type_row rows[] = {
+constexpr bn_type_row rows[] = {
     {bn_type_uint8, "uint8", 1, shape::natural, true, natural_out, natural_in, wire_number, nullptr},
     {bn_type_int8, "int8", 1, shape::integer, true, integer_out, integer_in, wire_number, nullptr},
     {bn_type_uint16, "uint16", 2, shape::natural, true, natural_out, natural_in, wire_number, nullptr},
@@ -389,14 +395,12 @@ static constexpr bn_type_row rows[] = {
 constexpr size_t ROW_COUNT = sizeof rows / sizeof rows[0];
 
 // Tables for lookup by number and by name, derived from the rows at compile time.
-namespace {
 struct derived_tables {
     lc_enum_entry names[ROW_COUNT + 1];
     bn_attrib_copy_func wire[BN_TYPE_LAST + 1];
     const bn_type_row *by_number[BN_TYPE_LAST + 1];
 };
-} // namespace
-static constexpr derived_tables derive() {
+constexpr derived_tables derive() {
     derived_tables tables{};
     for (size_t i = 0; i < ROW_COUNT; i++) {
         tables.names[i] = {static_cast<int32_t>(rows[i].number), rows[i].name};
@@ -406,7 +410,10 @@ static constexpr derived_tables derive() {
     }
     return tables;
 }
-static constexpr derived_tables tables = derive();
+constexpr derived_tables tables = derive();
+
+} // namespace
+
 const lc_enum_entry *const bn_type_table = tables.names;
 const bn_attrib_copy_func *const bn_attrib_copy_funcs = tables.wire;
 
@@ -417,9 +424,14 @@ const bn_type_row *bn_type_find(uint32_t type_and_flags) {
 
 // --- Predicates and order
 
-static const bn_type_row *row_with_value(uint32_t type_and_flags) {
+namespace {
+
+const bn_type_row *row_with_value(uint32_t type_and_flags) {
     return type_and_flags & bn_flag_no_value ? nullptr : bn_type_find(type_and_flags);
 }
+
+} // namespace
+
 bool bn_type_numeric(uint32_t type_and_flags) {
     const bn_type_row *row = row_with_value(type_and_flags);
     return row && row->numeric;
@@ -440,16 +452,21 @@ uint32_t bn_type_fixed_size(uint32_t type_and_flags) {
     return row ? row->size : 0;
 }
 
+namespace {
+
 template <typename Number>
-static int order(Number a, Number b) {
+int order(Number a, Number b) {
     return (a > b) - (a < b);
 }
-static int compare_binary(const tbuffer *a, const tbuffer *b) {
+int compare_binary(const tbuffer *a, const tbuffer *b) {
     if (!a || !b)
         return (a ? 0 : 1) - (b ? 0 : 1);
     const int result = memcmp(a->buffer, b->buffer, std::min(a->length, b->length));
     return result ? result : order(a->length, b->length);
 }
+
+} // namespace
+
 int bn_value_compare(const bn_type_row *row, const bn_attrib *a, const bn_attrib *b) {
     switch (row->shape) {
     case value_shape::none:

@@ -17,14 +17,18 @@ lc_status mgmt_client_init(mgmt_client *client, fdic_handler close_handler) {
     return LC_OK;
 }
 
+namespace {
+
 // LC_IO_ERROR and LC_IO_CLOSED mean that mgmtd isn't running, which the caller logs.
-static lc_status connect_quietly(gcl_session *session) {
+lc_status connect_quietly(gcl_session *session) {
     const lc_status status = gcl_session_client_connect_by_provider(session, "mgmtd", 1);
     if (status == LC_IO_ERROR || status == LC_IO_CLOSED)
         CHECK_QUIET(status);
     CHECK_STATUS(status);
     return LC_OK;
 }
+
+} // namespace
 
 lc_status mgmt_client_open(mgmt_client *client, const char *client_name, mdc_send_function msg_handler) {
     CHECK_STATUS(gcl_session_client_new(*client->instance, client_name, nullptr, 0, client->session));
@@ -43,9 +47,13 @@ void mgmt_client_deinit(mgmt_client *client) {
     LOG_STATUS(fdic_deinit(client->interests));
 }
 
-static bool exit_has_begun(const mgmt_client *client) {
+namespace {
+
+bool exit_has_begun(const mgmt_client *client) {
     return client->exiting->load() != 0;
 }
+
+} // namespace
 
 lc_status mgmt_client_request(mgmt_client *client, bn_request_msg *request, bn_response_msg **out_response) {
     CHECK_NULL(request);

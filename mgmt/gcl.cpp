@@ -59,9 +59,11 @@ lc_status gcl_options_get_defaults(gcl_options *out) {
     return LC_OK;
 }
 
+namespace {
+
 // A write to a closed peer must return EPIPE instead of ending the process. A process that handles SIGPIPE
 // gets EPIPE already, and keeps its handler.
-static void ignore_sigpipe() {
+void ignore_sigpipe() {
     struct sigaction action;
     if (sigaction(SIGPIPE, nullptr, &action) == 0 &&
         ((action.sa_flags & SA_SIGINFO) || action.sa_handler != SIG_DFL))
@@ -72,13 +74,15 @@ static void ignore_sigpipe() {
     sigaction(SIGPIPE, &action, nullptr);
 }
 
-static lc_status init_steps(gcl *instance) {
+lc_status init_steps(gcl *instance) {
     CHECK_CONDITION(lc_lock_init(&instance->lock, 1) == 0);
     ignore_sigpipe();
     CHECK_STATUS(gcl_admin_register(instance));
     CHECK_STATUS(gcl_bn_init(instance));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status gcl_init(gcl **out, const gcl_options *options, fdic *interests) {
     CHECK_NULL(out);

@@ -16,25 +16,27 @@
 #include "mgmt/gcl_records.h"
 #include "runtime/logging.h"
 
+namespace {
+
 template <size_t Size>
-static void put_text(char (&field)[Size], const char *text) {
+void put_text(char (&field)[Size], const char *text) {
     memset(field, 0, Size);
     memcpy(field, text, strnlen(text, Size - 1));
 }
-static void take_text(char (&text)[33], const char (&field)[32]) {
+void take_text(char (&text)[33], const char (&field)[32]) {
     memcpy(text, field, sizeof field);
     text[sizeof field] = 0;
 }
 
 // Copies the body of a frame. LC_ASSERTION if it is shorter than the layout.
 template <typename Layout>
-static lc_status body_of(const tbuffer *frame, Layout *out) {
+lc_status body_of(const tbuffer *frame, Layout *out) {
     CHECK_CONDITION(tb_length(frame) >= static_cast<int32_t>(GCL_HEADER_BYTES + sizeof(Layout)));
     memcpy(out, tb_buf(frame) + GCL_HEADER_BYTES, sizeof(Layout));
     return LC_OK;
 }
 
-static lc_status admin_session_new(gcl_session *session, gcl_body_protocol *) {
+lc_status admin_session_new(gcl_session *session, gcl_body_protocol *) {
     auto *admin = static_cast<gcl_admin *>(calloc(1, sizeof(gcl_admin)));
     CHECK_NULL(admin);
     admin->uid = session->uid;
@@ -44,13 +46,13 @@ static lc_status admin_session_new(gcl_session *session, gcl_body_protocol *) {
     return LC_OK;
 }
 
-static lc_status admin_session_free(gcl_session *session, gcl_body_protocol *) {
+lc_status admin_session_free(gcl_session *session, gcl_body_protocol *) {
     free(session->protocol_state[GCL_PROTO_ADMIN]);
     session->protocol_state[GCL_PROTO_ADMIN] = nullptr;
     return LC_OK;
 }
 
-static lc_status admin_established(gcl_session *session, gcl_body_protocol *) {
+lc_status admin_established(gcl_session *session, gcl_body_protocol *) {
     gcl_admin *admin = gcl_admin_of(session);
     CHECK_NULL(admin);
     admin->state = GCL_ADMIN_GREETING_AWAITED;
@@ -58,14 +60,14 @@ static lc_status admin_established(gcl_session *session, gcl_body_protocol *) {
     return LC_OK;
 }
 
-static lc_status admin_query_state(gcl_session *session, gcl_body_protocol *, int32_t *out_state) {
+lc_status admin_query_state(gcl_session *session, gcl_body_protocol *, int32_t *out_state) {
     const gcl_admin *admin = gcl_admin_of(session);
     CHECK_NULL(admin);
     *out_state = admin->state;
     return LC_OK;
 }
 
-static lc_status send_greeting_response(gcl_session *session, const gcl_admin *admin) {
+lc_status send_greeting_response(gcl_session *session, const gcl_admin *admin) {
     gcl *instance = session->instance;
     gcl_wire_greeting_response body{};
     body.version = to_be16(GCL_ADMIN_VERSION);
@@ -81,8 +83,7 @@ static lc_status send_greeting_response(gcl_session *session, const gcl_admin *a
     return LC_OK;
 }
 
-static bool log_bad_ids(const gcl_session *session, int32_t uid, int32_t gid, uid_t wanted_uid,
-                        gid_t wanted_gid) {
+bool log_bad_ids(const gcl_session *session, int32_t uid, int32_t gid, uid_t wanted_uid, gid_t wanted_gid) {
     char uid_text[16], gid_text[16];
     snprintf(uid_text, sizeof uid_text, "%d", static_cast<int>(wanted_uid));
     snprintf(gid_text, sizeof gid_text, "%d", static_cast<int>(wanted_gid));
@@ -93,7 +94,7 @@ static bool log_bad_ids(const gcl_session *session, int32_t uid, int32_t gid, ui
 
 // Every user can create a socket with the provider's name, since the directory is writable for all, and send
 // any ids in a greeting. The user id of the listening process comes from the kernel.
-static bool listener_is_trusted(const gcl_session *session) {
+bool listener_is_trusted(const gcl_session *session) {
     ucred listener{};
     socklen_t length = sizeof listener;
     if (getsockopt(session->fd, SOL_SOCKET, SO_PEERCRED, &listener, &length) != 0) {
@@ -109,7 +110,7 @@ static bool listener_is_trusted(const gcl_session *session) {
 
 // Checks the peer by the ids in its greeting. Without ids (-1 and -1) it gets those of this process;
 // otherwise they must be those of the owner of its socket file, or of this process if it has no file.
-static bool peer_is_trusted(const gcl_session *session, int32_t *inout_uid, int32_t *inout_gid) {
+bool peer_is_trusted(const gcl_session *session, int32_t *inout_uid, int32_t *inout_gid) {
     const int32_t uid = *inout_uid, gid = *inout_gid;
     if (session->family != AF_UNIX && session->family != AF_INET) {
         LC_LOG(LC_LOG_DEBUG, "session %d: unknown af: %d", session->id, session->family);
@@ -142,13 +143,13 @@ static bool peer_is_trusted(const gcl_session *session, int32_t *inout_uid, int3
     return true;
 }
 
-static lc_status refuse_peer(gcl_session *session) {
+lc_status refuse_peer(gcl_session *session) {
     LC_LOG(LC_LOG_INFO, "session %d: session terminated by client", session->id);
     CHECK_STATUS(gcl_session_close(session, 0));
     return LC_OK;
 }
 
-static lc_status receive_greeting(gcl_session *session, gcl_body_protocol *, tbuffer **frame, void *) {
+lc_status receive_greeting(gcl_session *session, gcl_body_protocol *, tbuffer **frame, void *) {
     const gcl_owned_buffer taken(*frame);
     *frame = nullptr;
     gcl_wire_greeting body{};
@@ -186,6 +187,8 @@ static lc_status receive_greeting(gcl_session *session, gcl_body_protocol *, tbu
     return LC_OK;
 }
 
+} // namespace
+
 lc_status gcl_session_client_open_service(gcl_session *session, uint16_t protocol, int32_t service,
                                           const char *name, int32_t) {
     CHECK_NULL(session);
@@ -215,7 +218,9 @@ lc_status gcl_session_client_open_service(gcl_session *session, uint16_t protoco
     return LC_OK;
 }
 
-static lc_status receive_open_response(gcl_session *session, gcl_body_protocol *, tbuffer **frame, void *) {
+namespace {
+
+lc_status receive_open_response(gcl_session *session, gcl_body_protocol *, tbuffer **frame, void *) {
     const gcl_owned_buffer taken(*frame);
     *frame = nullptr;
     gcl_wire_open_service_response body{};
@@ -237,11 +242,13 @@ static lc_status receive_open_response(gcl_session *session, gcl_body_protocol *
     return LC_OK;
 }
 
-static lc_status receive_other(gcl_session *session, gcl_body_protocol *, tbuffer **frame, void *) {
+lc_status receive_other(gcl_session *session, gcl_body_protocol *, tbuffer **frame, void *) {
     LC_LOG(LC_LOG_DEBUG, "session %d: proto admin: in receive CATCHALL", session->id);
     tb_free(frame);
     return LC_OK;
 }
+
+} // namespace
 
 lc_status gcl_admin_register(gcl *instance) {
     gcl_body_protocol admin{};

@@ -47,13 +47,11 @@ struct blocking_wait {
     uint32_t timer_count;
 };
 
-} // namespace
-
-static void free_polled(pollfd *polled) {
+void free_polled(pollfd *polled) {
     free(polled);
 }
 
-static watched_state look(const blocking_wait *wait) {
+watched_state look(const blocking_wait *wait) {
     watched_state seen{wait->session->counters.frames_sent, wait->session->counters.frames_received,
                        wait->session->state, 0};
     gcl_body_protocol *protocol = gcl_get_body_protocol(wait->instance, wait->protocol);
@@ -62,7 +60,7 @@ static watched_state look(const blocking_wait *wait) {
     return seen;
 }
 
-static bool changed(const blocking_wait *wait, const watched_state *before) {
+bool changed(const blocking_wait *wait, const watched_state *before) {
     const watched_state now = look(wait);
     const bool differs = (wait->on_sent && now.frames_sent != before->frames_sent) ||
                          (wait->on_received && now.frames_received != before->frames_received) ||
@@ -72,6 +70,8 @@ static bool changed(const blocking_wait *wait, const watched_state *before) {
         LC_LOG(LC_LOG_DEBUG, "CHANGE DETECTED");
     return differs;
 }
+
+} // namespace
 
 bool gcl_end_is_pending(const gcl *instance) {
     if (instance->options.ending && *instance->options.ending)
@@ -85,8 +85,10 @@ bool gcl_end_is_pending(const gcl *instance) {
     return false;
 }
 
+namespace {
+
 // The time left in milliseconds; -1 without a limit, -2 if there is none left.
-static int64_t time_left(blocking_wait *wait) {
+int64_t time_left(blocking_wait *wait) {
     if (wait->timeout_ms < 0)
         return -1;
     const int64_t now = lt_curr_time_ms();
@@ -97,7 +99,7 @@ static int64_t time_left(blocking_wait *wait) {
     return left < 0 ? -2 : left;
 }
 
-static void forget_deleted_timers(blocking_wait *wait, const fdic_event_array *events) {
+void forget_deleted_timers(blocking_wait *wait, const fdic_event_array *events) {
     for (uint32_t i = wait->timer_count; i-- > 0;) {
         fdic_event key{};
         key.id = wait->timers[i].id;
@@ -107,7 +109,7 @@ static void forget_deleted_timers(blocking_wait *wait, const fdic_event_array *e
 }
 
 // The record of a timer, which is made when the timer is first seen, and runs from then on.
-static lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t now, seen_timer **out) {
+lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t now, seen_timer **out) {
     uint32_t at = 0;
     while (at < wait->timer_count && wait->timers[at].id != event->id)
         at++;
@@ -126,7 +128,7 @@ static lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t
 }
 
 // Calls the timers that are due, each once. `out_next`: milliseconds to the next one, -1 if there is none.
-static lc_status run_timers(blocking_wait *wait, const fdic_event_array *events, int64_t *out_next) {
+lc_status run_timers(blocking_wait *wait, const fdic_event_array *events, int64_t *out_next) {
     const int64_t now = lt_monotonic_ms();
     *out_next = -1;
     forget_deleted_timers(wait, events);
@@ -151,7 +153,7 @@ static lc_status run_timers(blocking_wait *wait, const fdic_event_array *events,
     return LC_OK;
 }
 
-static lc_status fill_polled(const fdic_event_array *events, pollfd *polled) {
+lc_status fill_polled(const fdic_event_array *events, pollfd *polled) {
     for (uint32_t i = 0; i < fdic_event_array_length_quick(events); i++) {
         const fdic_event *event = fdic_event_array_get_quick(events, i);
         polled[i] = {-1, 0, 0};
@@ -170,8 +172,8 @@ static lc_status fill_polled(const fdic_event_array *events, pollfd *polled) {
 
 // Calls the functions of the descriptors that are ready, until something that the caller waits for has
 // changed.
-static lc_status run_ready(const blocking_wait *wait, const fdic_event_array *events, const pollfd *polled,
-                           const watched_state *before, bool *out_stop) {
+lc_status run_ready(const blocking_wait *wait, const fdic_event_array *events, const pollfd *polled,
+                    const watched_state *before, bool *out_stop) {
     // As in an event loop, an error shows as readable and writable, so that the session finds it.
     constexpr short broken = POLLERR | POLLHUP | POLLNVAL;
     for (uint32_t i = 0; i < fdic_event_array_length_quick(events) && !*out_stop; i++) {
@@ -194,7 +196,7 @@ static lc_status run_ready(const blocking_wait *wait, const fdic_event_array *ev
     return LC_OK;
 }
 
-static lc_status wait_round(blocking_wait *wait, bool *out_stop) {
+lc_status wait_round(blocking_wait *wait, bool *out_stop) {
     if (wait->session->state == GCL_SESSION_CLOSED || wait->session->fd < 0)
         return LC_IO_CLOSED;
     if (gcl_end_is_pending(wait->instance))
@@ -229,6 +231,8 @@ static lc_status wait_round(blocking_wait *wait, bool *out_stop) {
     return run_ready(wait, events.pointer, polled.pointer, &before, out_stop);
 }
 
+} // namespace
+
 lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int stop_on_frames_sent,
                                      int stop_on_frames_received, int stop_on_session_state,
                                      int stop_on_protocol_state, uint16_t protocol, int64_t timeout_ms) {
@@ -254,9 +258,11 @@ lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int st
     return LC_OK;
 }
 
+namespace {
+
 // One step of opening a service. A peer that closes, or doesn't answer in time, is an ordinary event and not
 // logged. If it closes, the session is closed.
-static lc_status wait_for_peer(gcl_session *session, int on_received, uint16_t protocol, int64_t timeout_ms) {
+lc_status wait_for_peer(gcl_session *session, int on_received, uint16_t protocol, int64_t timeout_ms) {
     const lc_status status =
         gcl_session_do_blocking_io(session->instance, session, 0, on_received, 1, 1, protocol, timeout_ms);
     if (status == LC_IO_TIMED_OUT)
@@ -268,6 +274,8 @@ static lc_status wait_for_peer(gcl_session *session, int on_received, uint16_t p
     CHECK_STATUS(status);
     return LC_OK;
 }
+
+} // namespace
 
 lc_status gcl_session_client_open_service_blocking(gcl_session *session, uint16_t protocol, int32_t service,
                                                    const char *name, int32_t reserved, int64_t timeout_ms) {

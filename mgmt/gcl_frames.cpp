@@ -27,18 +27,22 @@
 
 constexpr int64_t RATE_SLICE_MS = 100;
 
-static void swap16(uint8_t *at) {
+namespace {
+
+void swap16(uint8_t *at) {
     const uint8_t first = at[0];
     at[0] = at[1];
     at[1] = first;
 }
-static void swap32(uint8_t *at) {
+void swap32(uint8_t *at) {
     const uint8_t first = at[0], second = at[1];
     at[0] = at[3];
     at[1] = at[2];
     at[2] = second;
     at[3] = first;
 }
+
+} // namespace
 
 void gcl_byte_swap_frame_header(void *header) {
     auto *bytes = static_cast<uint8_t *>(header);
@@ -53,7 +57,9 @@ void gcl_byte_swap_frame_header(void *header) {
 
 // --- Sending
 
-static void fill_header(uint8_t *at, uint32_t sequence, uint16_t proto, uint16_t mtype, uint32_t total) {
+namespace {
+
+void fill_header(uint8_t *at, uint32_t sequence, uint16_t proto, uint16_t mtype, uint32_t total) {
     gcl_frame_header header = {
         {},    GCL_FRAME_MARKER,        GCL_FRAME_VERSION, total, GCL_HEADER_BYTES, 0, sequence, proto,
         mtype, total - GCL_HEADER_BYTES};
@@ -61,7 +67,7 @@ static void fill_header(uint8_t *at, uint32_t sequence, uint16_t proto, uint16_t
     memcpy(at, &header, sizeof header);
 }
 
-static lc_status check_sendable(const gcl_session *session) {
+lc_status check_sendable(const gcl_session *session) {
     if (session->state == GCL_SESSION_CONNECTED)
         return LC_OK;
     LC_LOG(LC_LOG_WARNING, "session %d: tried to send frame in state %d", session->id, session->state);
@@ -69,7 +75,7 @@ static lc_status check_sendable(const gcl_session *session) {
 }
 
 // Whether a frame of `total` bytes fits in the queue, whose limit is `queue_max`.
-static lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue_max) {
+lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue_max) {
     if (total > GCL_FRAME_MAX) {
         LC_LOG(LC_LOG_WARNING, "session %d: message of %llu bytes does not fit a frame", session->id,
                static_cast<unsigned long long>(total));
@@ -86,7 +92,7 @@ static lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue
     return LC_CANCELLED;
 }
 
-static void note_drained(gcl_session *session) {
+void note_drained(gcl_session *session) {
     // At half of the limit, so that a queue which stays nearly full doesn't log a pair of lines per frame.
     if (!session->frames_lost || session->queued_bytes > GCL_QUEUE_MAX_BYTES / 2)
         return;
@@ -95,7 +101,7 @@ static void note_drained(gcl_session *session) {
     session->frames_lost = 0;
 }
 
-static lc_status queue_frame(gcl_session *session, tbuffer **inout_buffer, uint32_t sequence) {
+lc_status queue_frame(gcl_session *session, tbuffer **inout_buffer, uint32_t sequence) {
     auto *frame = static_cast<gcl_frame *>(calloc(1, sizeof(gcl_frame)));
     CHECK_NULL(frame);
     const lc_status status = tb_detach(inout_buffer, &frame->bytes, &frame->length);
@@ -115,13 +121,15 @@ static lc_status queue_frame(gcl_session *session, tbuffer **inout_buffer, uint3
 }
 
 // Writes the header to the start of the buffer, and queues the buffer.
-static lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtype, tbuffer **inout_buffer) {
+lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtype, tbuffer **inout_buffer) {
     const auto total = static_cast<uint32_t>(tb_length(*inout_buffer));
     const uint32_t sequence = session->sequence++;
     fill_header(tb_buf(*inout_buffer), sequence, proto, mtype, total);
     CHECK_STATUS(queue_frame(session, inout_buffer, sequence));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status gcl_session_send_frame_components(gcl_session *session, uint16_t proto, uint16_t mtype,
                                             uint32_t length, const void *body) {
@@ -185,7 +193,9 @@ void gcl_free_queue(gcl_session *session) {
     session->queued_bytes = 0;
 }
 
-static void finish_frame(gcl_session *session) {
+namespace {
+
+void finish_frame(gcl_session *session) {
     gcl_frame *frame = session->queue_head;
     session->counters.frames_sent++;
     LC_LOG(LC_LOG_DEBUG, "session %d: finished sending frame %d on fd %d of %d bytes", session->id,
@@ -198,11 +208,11 @@ static void finish_frame(gcl_session *session) {
 }
 
 // The number of bytes that one run of the queue may send; no limit without a rate limit.
-static uint64_t slice_bytes(const gcl_session *session) {
+uint64_t slice_bytes(const gcl_session *session) {
     return session->rate_limit ? session->rate_limit * 1024ull * RATE_SLICE_MS / 1000 : UINT64_MAX;
 }
 
-static lc_status wait_for_slice(gcl_session *session) {
+lc_status wait_for_slice(gcl_session *session) {
     if (session->rate_timer >= 0)
         return LC_OK;
     CHECK_STATUS(fdic_event_add_timer(session->instance->interests, RATE_SLICE_MS, session,
@@ -213,7 +223,7 @@ static lc_status wait_for_slice(gcl_session *session) {
 
 // Writes until the queue is empty or the socket is full (`out_blocked`). With a rate limit the rest of the
 // queue waits for a timer.
-static lc_status write_queue(gcl_session *session, bool *out_blocked) {
+lc_status write_queue(gcl_session *session, bool *out_blocked) {
     uint64_t slice = slice_bytes(session);
     while (gcl_frame *frame = session->queue_head) {
         if (!slice)
@@ -247,6 +257,8 @@ static lc_status write_queue(gcl_session *session, bool *out_blocked) {
     return LC_OK;
 }
 
+} // namespace
+
 lc_status gcl_run_output_queue(gcl_session *session) {
     LC_LOG(LC_LOG_DEBUG, "session %d: running output queue", session->id);
     bool blocked = false;
@@ -267,7 +279,9 @@ lc_status gcl_run_output_queue(gcl_session *session) {
 
 // --- Passing frames to their handlers
 
-static lc_status check_header(const gcl_session *session, const gcl_frame_header *header, uint32_t received) {
+namespace {
+
+lc_status check_header(const gcl_session *session, const gcl_frame_header *header, uint32_t received) {
     if (memcmp(header->ident, GCL_FRAME_IDENT, sizeof header->ident) != 0) {
         uint32_t ident;
         memcpy(&ident, header->ident, sizeof ident);
@@ -291,13 +305,13 @@ static lc_status check_header(const gcl_session *session, const gcl_frame_header
     return LC_OK;
 }
 
-static const gcl_message_handler *handler_of(const gcl_body_protocol *protocol, uint16_t mtype) {
+const gcl_message_handler *handler_of(const gcl_body_protocol *protocol, uint16_t mtype) {
     if (mtype < GCL_HANDLERS_MAX && protocol->handlers[mtype].function)
         return &protocol->handlers[mtype];
     return protocol->handlers[0].function ? &protocol->handlers[0] : nullptr;
 }
 
-static lc_status hand_over(gcl_session *session, tbuffer **inout_frame) {
+lc_status hand_over(gcl_session *session, tbuffer **inout_frame) {
     const auto length = static_cast<uint32_t>(tb_length(*inout_frame));
     gcl_byte_swap_frame_header(tb_buf(*inout_frame));
     gcl_frame_header header;
@@ -327,12 +341,12 @@ static lc_status hand_over(gcl_session *session, tbuffer **inout_frame) {
 
 // --- Reading
 
-static uint32_t bytes_unread(const gcl_session *session) {
+uint32_t bytes_unread(const gcl_session *session) {
     return static_cast<uint32_t>(tb_length(session->read_buffer)) - session->read_position;
 }
 
 // Empties the buffer; one that a large frame has enlarged is replaced by one of the first size.
-static lc_status reset_buffer(gcl_session *session) {
+lc_status reset_buffer(gcl_session *session) {
     session->read_position = 0;
     if (tb_size(session->read_buffer) > GCL_READ_BUFFER_KEEP) {
         tb_free(&session->read_buffer);
@@ -344,7 +358,7 @@ static lc_status reset_buffer(gcl_session *session) {
 }
 
 // A copy of the next complete frame; null if more bytes have to be received first.
-static lc_status next_frame(gcl_session *session, tbuffer **out_frame) {
+lc_status next_frame(gcl_session *session, tbuffer **out_frame) {
     const uint32_t unread = bytes_unread(session);
     if (unread < GCL_HEADER_BYTES) {
         LC_LOG(LC_LOG_DEBUG, "session %d: bu: not enough for header", session->id);
@@ -378,7 +392,7 @@ static lc_status next_frame(gcl_session *session, tbuffer **out_frame) {
     return LC_OK;
 }
 
-static lc_status deliver_frames(gcl_session *session) {
+lc_status deliver_frames(gcl_session *session) {
     while (session->state == GCL_SESSION_CONNECTED) {
         gcl_owned_buffer frame;
         CHECK_QUIET(next_frame(session, &frame.pointer));
@@ -391,7 +405,7 @@ static lc_status deliver_frames(gcl_session *session) {
 
 // Makes room for a read. Frames that have been delivered are deleted from the front of the buffer only here,
 // once per read; deleting each frame would move all the others each time.
-static lc_status make_room(gcl_session *session) {
+lc_status make_room(gcl_session *session) {
     tbuffer *buffer = session->read_buffer;
     if (tb_avail(buffer) >= GCL_READ_ROOM)
         return LC_OK;
@@ -402,7 +416,7 @@ static lc_status make_room(gcl_session *session) {
     return LC_OK;
 }
 
-static lc_status read_activity(gcl_session *session) {
+lc_status read_activity(gcl_session *session) {
     tbuffer *buffer = session->read_buffer;
     CHECK_STATUS(make_room(session));
     const auto length = static_cast<uint32_t>(tb_length(buffer));
@@ -429,12 +443,12 @@ static lc_status read_activity(gcl_session *session) {
     return LC_OK;
 }
 
-static lc_status write_activity(gcl_session *session) {
+lc_status write_activity(gcl_session *session) {
     LC_LOG(LC_LOG_DEBUG, "session %d: write activity", session->id);
     return gcl_run_output_queue(session);
 }
 
-static lc_status timer_activity(gcl_session *session) {
+lc_status timer_activity(gcl_session *session) {
     LC_LOG(LC_LOG_DEBUG, "session %d: rate limit timer fired", session->id);
     const int32_t timer = session->rate_timer;
     session->rate_timer = -1;
@@ -442,6 +456,8 @@ static lc_status timer_activity(gcl_session *session) {
         CHECK_STATUS(fdic_event_delete_timer(session->instance->interests, timer));
     return gcl_run_output_queue(session);
 }
+
+} // namespace
 
 // Called by the loop that drives the session. Another thread may have closed the session in the meantime, and
 // its descriptor may have been reused since. Only the session's state, under its lock, is relevant, not the

@@ -29,7 +29,9 @@ constexpr int CONNECT_DELAY_MS = 1500;
 
 // --- Names
 
-static lc_status check_client_name(const char *name) {
+namespace {
+
+lc_status check_client_name(const char *name) {
     if (name && strchr(name, '-')) {
         LC_LOG(LC_LOG_ERR, "Invalid character in client name: %s", name);
         return LC_GENERIC;
@@ -41,7 +43,7 @@ static lc_status check_client_name(const char *name) {
     return LC_OK;
 }
 
-static void set_local_name(gcl_session *session, const char *client_name) {
+void set_local_name(gcl_session *session, const char *client_name) {
     const int pid = static_cast<int>(getpid());
     const int uid = static_cast<int>(geteuid());
     char *name = session->local_name;
@@ -53,7 +55,7 @@ static void set_local_name(gcl_session *session, const char *client_name) {
         snprintf(name, sizeof session->local_name, "%s-%d.%d", client_name, uid, pid);
 }
 
-static lc_status set_user(gcl_session *session) {
+lc_status set_user(gcl_session *session) {
     for (const char *variable : {"LOGIN_USER", "LOGNAME", "USER"}) {
         owned_text value;
         CHECK_STATUS(lc_getenv_ts(variable, &value.pointer));
@@ -67,6 +69,8 @@ static lc_status set_user(gcl_session *session) {
     return LC_OK;
 }
 
+} // namespace
+
 void gcl_socket_path(const char *role, const char *name, char *out, size_t size) {
     if (lc_devel_is_production())
         snprintf(out, size, "%suds-%s-%s", GCL_SOCKET_DIRECTORY, role, name);
@@ -75,7 +79,9 @@ void gcl_socket_path(const char *role, const char *name, char *out, size_t size)
                  name);
 }
 
-static void make_endpoint(gcl_endpoint *endpoint, const char *role, const char *name) {
+namespace {
+
+void make_endpoint(gcl_endpoint *endpoint, const char *role, const char *name) {
     char path[256];
     gcl_socket_path(role, name, path, sizeof path);
     strlcpy(endpoint->path, path, sizeof endpoint->path);
@@ -86,7 +92,7 @@ static void make_endpoint(gcl_endpoint *endpoint, const char *role, const char *
     endpoint->length = static_cast<socklen_t>(strlen(address.sun_path) + 3);
 }
 
-static lc_status copy_endpoint(gcl_endpoint *endpoint, const sockaddr *address, socklen_t length) {
+lc_status copy_endpoint(gcl_endpoint *endpoint, const sockaddr *address, socklen_t length) {
     CHECK_CONDITION(length >= sizeof(sa_family_t) && length <= sizeof endpoint->address);
     *endpoint = {};
     memcpy(&endpoint->address, address, length);
@@ -100,7 +106,7 @@ static lc_status copy_endpoint(gcl_endpoint *endpoint, const sockaddr *address, 
     return LC_OK;
 }
 
-static void endpoint_text(const gcl_endpoint *endpoint, char *out, size_t size) {
+void endpoint_text(const gcl_endpoint *endpoint, char *out, size_t size) {
     strlcpy(out, endpoint->path, size);
     if (endpoint->address.ss_family != AF_INET)
         return;
@@ -112,7 +118,7 @@ static void endpoint_text(const gcl_endpoint *endpoint, char *out, size_t size) 
 
 // --- Making
 
-static lc_status open_unix(gcl_session *session) {
+lc_status open_unix(gcl_session *session) {
     // The socket is bound to a path of its own, which is how the provider sees who is connected.
     const char *path = session->local.path;
     // The first client of any user creates the directory. With the sticky bit nobody can remove another
@@ -129,7 +135,7 @@ static lc_status open_unix(gcl_session *session) {
     return LC_OK;
 }
 
-static lc_status open_inet(gcl_session *session) {
+lc_status open_inet(gcl_session *session) {
     if (geteuid() != 0 && (getuid() != geteuid() || getgid() != getegid())) {
         LC_LOG(LC_LOG_ERR, "Bad uid/gid for INET client connection");
         return LC_GENERIC;
@@ -152,7 +158,7 @@ static lc_status open_inet(gcl_session *session) {
     return LC_OK;
 }
 
-static lc_status open_socket(gcl_session *session) {
+lc_status open_socket(gcl_session *session) {
     session->family = session->local.address.ss_family;
     if (session->family != AF_UNIX && session->family != AF_INET) {
         LC_LOG(LC_LOG_ERR, "Unknown af %d", session->family);
@@ -167,7 +173,7 @@ static lc_status open_socket(gcl_session *session) {
     return LC_OK;
 }
 
-static gcl_session_hook hook_of(const gcl_body_protocol *protocol, gcl_hook_kind kind) {
+gcl_session_hook hook_of(const gcl_body_protocol *protocol, gcl_hook_kind kind) {
     switch (kind) {
     case GCL_HOOK_NEW:
         return protocol->session_new;
@@ -181,6 +187,8 @@ static gcl_session_hook hook_of(const gcl_body_protocol *protocol, gcl_hook_kind
     return nullptr;
 }
 
+} // namespace
+
 lc_status gcl_run_hooks(gcl_session *session, gcl_hook_kind kind) {
     for (gcl_body_protocol *protocol : session->instance->protocols) {
         const gcl_session_hook hook = protocol ? hook_of(protocol, kind) : nullptr;
@@ -190,12 +198,14 @@ lc_status gcl_run_hooks(gcl_session *session, gcl_hook_kind kind) {
     return LC_OK;
 }
 
-static void *interest_argument(uintptr_t kind) {
+namespace {
+
+void *interest_argument(uintptr_t kind) {
     return reinterpret_cast<void *>(kind);
 }
 
-static lc_status new_steps(gcl_session *session, const char *client_name, const sockaddr *address,
-                           socklen_t length) {
+lc_status new_steps(gcl_session *session, const char *client_name, const sockaddr *address,
+                    socklen_t length) {
     gcl *instance = session->instance;
     CHECK_CONDITION(lc_lock_init(&session->lock, 1) == 0);
     session->uid = static_cast<int32_t>(geteuid());
@@ -220,6 +230,8 @@ static lc_status new_steps(gcl_session *session, const char *client_name, const 
                                    &session->fd_interest));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status gcl_session_client_new(gcl *instance, const char *client_name, const sockaddr *address,
                                  socklen_t length, gcl_session **out) {
@@ -254,8 +266,10 @@ lc_status gcl_session_client_new(gcl *instance, const char *client_name, const s
 
 // --- Connecting
 
+namespace {
+
 // Closes a session that could not connect.
-static void give_up(gcl_session *session) {
+void give_up(gcl_session *session) {
     if (session->fd_interest >= 0)
         LOG_STATUS(fdic_event_update_fd(session->instance->interests, session->fd_interest, 0, 0));
     close(session->fd);
@@ -266,7 +280,7 @@ static void give_up(gcl_session *session) {
     session->peer = {};
 }
 
-static lc_status try_connect(gcl_session *session, int attempts) {
+lc_status try_connect(gcl_session *session, int attempts) {
     // EISCONN: an earlier attempt on the non-blocking socket has succeeded meanwhile.
     for (;;) {
         attempts--;
@@ -293,6 +307,8 @@ static lc_status try_connect(gcl_session *session, int attempts) {
         return LC_ASSERTION;
     }
 }
+
+} // namespace
 
 lc_status gcl_session_client_connect_by_sockaddr(gcl_session *session, const sockaddr *address,
                                                  socklen_t length, int retry) {
@@ -334,7 +350,9 @@ lc_status gcl_session_client_connect_by_provider(gcl_session *session, const cha
 
 // --- Ending
 
-static void drop_interests(gcl_session *session) {
+namespace {
+
+void drop_interests(gcl_session *session) {
     fdic *interests = session->instance->interests;
     const int32_t timer = session->rate_timer, descriptor = session->fd_interest;
     session->rate_timer = session->fd_interest = -1;
@@ -343,6 +361,8 @@ static void drop_interests(gcl_session *session) {
     if (descriptor >= 0) // last, since it calls the close handler
         LOG_STATUS(fdic_event_delete_fd(interests, descriptor));
 }
+
+} // namespace
 
 lc_status gcl_session_close(gcl_session *session, int flush) {
     CHECK_NULL(session);
@@ -370,7 +390,9 @@ lc_status gcl_session_close(gcl_session *session, int flush) {
     return LC_OK;
 }
 
-static void take_out(gcl_session *session) {
+namespace {
+
+void take_out(gcl_session *session) {
     for (gcl_session **link = &session->instance->sessions; *link; link = &(*link)->next) {
         if (*link == session) {
             *link = session->next;
@@ -378,6 +400,8 @@ static void take_out(gcl_session *session) {
         }
     }
 }
+
+} // namespace
 
 lc_status gcl_session_free(gcl_session **inout) {
     CHECK_NULL(inout);

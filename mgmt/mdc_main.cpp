@@ -38,7 +38,9 @@ void mdc_free(mdc **inout_handle) {
     *inout_handle = nullptr;
 }
 
-static void clear_outs(uint32_t *out_code, tstring **out_message, bn_binding_array **out_bindings) {
+namespace {
+
+void clear_outs(uint32_t *out_code, tstring **out_message, bn_binding_array **out_bindings) {
     if (out_code)
         *out_code = 0;
     if (out_message)
@@ -46,6 +48,8 @@ static void clear_outs(uint32_t *out_code, tstring **out_message, bn_binding_arr
     if (out_bindings)
         *out_bindings = nullptr;
 }
+
+} // namespace
 
 lc_status mdc_send_mgmt_msg(mdc *handle, bn_request_msg *request, int keep_parts,
                             bn_binding_array **out_bindings, uint32_t *out_code, tstring **out_message) {
@@ -118,7 +122,9 @@ lc_status mdc_get_binding_children_ex(mdc *handle, uint32_t *out_code, tstring *
     return LC_OK;
 }
 
-static lc_status append_triples(bn_request_msg *request, uint32_t count, va_list triples) {
+namespace {
+
+lc_status append_triples(bn_request_msg *request, uint32_t count, va_list triples) {
     for (uint32_t i = 0; i < count; i++) {
         const char *name = va_arg(triples, const char *);
         if (!name)
@@ -129,6 +135,8 @@ static lc_status append_triples(bn_request_msg *request, uint32_t count, va_list
     }
     return LC_OK;
 }
+
+} // namespace
 
 lc_status mdc_send_action_with_bindings_str_va(mdc *handle, uint32_t *out_code, tstring **out_message,
                                                const char *action_name, uint32_t count, ...) {
@@ -157,9 +165,10 @@ lc_status mdc_foreach_binding_prequeried(const bn_binding_array *bindings, const
     return LC_OK;
 }
 
-static lc_status foreach_one(const bn_binding_array *bindings, bn_binding *binding,
-                             const tstr_array *pattern_parts, mdc_foreach_function callback, void *data,
-                             uint32_t *matches) {
+namespace {
+
+lc_status foreach_one(const bn_binding_array *bindings, bn_binding *binding, const tstr_array *pattern_parts,
+                      mdc_foreach_function callback, void *data, uint32_t *matches) {
     const tstr_array *parts = nullptr;
     int absolute = 0;
     CHECK_STATUS(bn_binding_get_name_parts_const(binding, &parts, &absolute));
@@ -183,6 +192,8 @@ static lc_status foreach_one(const bn_binding_array *bindings, bn_binding *bindi
     ++*matches;
     return LC_OK;
 }
+
+} // namespace
 
 lc_status mdc_foreach_binding_prequeried_parsed(const bn_binding_array *bindings,
                                                 const tstr_array *pattern_parts, void *,

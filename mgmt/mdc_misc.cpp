@@ -36,9 +36,15 @@ void mdc_remote_reg_free(mdc_remote_reg **inout) {
     free(*inout);
     *inout = nullptr;
 }
-static void free_reg(mdc_remote_reg *record) {
+
+namespace {
+
+void free_reg(mdc_remote_reg *record) {
     mdc_remote_reg_free(&record);
 }
+
+} // namespace
+
 using owned_reg = owned<mdc_remote_reg, free_reg>;
 
 void mdc_remote_reg_free_for_tree(void *value) {
@@ -110,12 +116,10 @@ struct mon_walk {
     mon_answer *answer;
 };
 
-} // namespace
-
-static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth);
+lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth);
 
 // The number of bytes that a binding takes in a message; a little too large for a name with escapes.
-static uint64_t wire_bytes(const bn_binding *binding) {
+uint64_t wire_bytes(const bn_binding *binding) {
     constexpr uint64_t NODE_BYTES = 13, PART_BYTES = 4, ATTRIBUTE_BYTES = 20;
     uint64_t bytes = NODE_BYTES;
     const char *name = bn_binding_get_name_quick(binding);
@@ -127,7 +131,7 @@ static uint64_t wire_bytes(const bn_binding *binding) {
     return bytes;
 }
 
-static lc_status get_node(const mon_walk *walk, const char *name, const tstr_array *parts) {
+lc_status get_node(const mon_walk *walk, const char *name, const tstr_array *parts) {
     uint32_t at = bn_binding_array_length_quick(walk->found);
     CHECK_STATUS(walk->get(name, parts, walk->get_data, walk->found));
     for (; at < bn_binding_array_length_quick(walk->found); at++)
@@ -136,7 +140,7 @@ static lc_status get_node(const mon_walk *walk, const char *name, const tstr_arr
     return LC_OK;
 }
 
-static lc_status walk_child(const mon_walk *walk, tstr_array *parts, const char *child, uint32_t depth) {
+lc_status walk_child(const mon_walk *walk, tstr_array *parts, const char *child, uint32_t depth) {
     owned_tstring name;
     CHECK_STATUS(ts_new_str(&name.pointer, child));
     CHECK_STATUS(tstr_array_append_takeover(parts, &name.pointer));
@@ -148,17 +152,13 @@ static lc_status walk_child(const mon_walk *walk, tstr_array *parts, const char 
     return LC_OK;
 }
 
-namespace {
-
 struct child_walk {
     const mon_walk *walk;
     tstr_array *parts;
     uint32_t depth;
 };
 
-} // namespace
-
-static lc_status walk_tree_child(tree *, tree_node *, const char *name, void *value, void *data) {
+lc_status walk_tree_child(tree *, tree_node *, const char *name, void *value, void *data) {
     (void)value;
     const child_walk *child = static_cast<const child_walk *>(data);
     CHECK_STATUS(walk_child(child->walk, child->parts, name, child->depth));
@@ -166,7 +166,7 @@ static lc_status walk_tree_child(tree *, tree_node *, const char *name, void *va
 }
 
 // The name is that of a registered wildcard: the daemon is asked for the children of its parent.
-static lc_status walk_wildcard(const mon_walk *walk, tstr_array *parts, uint32_t depth) {
+lc_status walk_wildcard(const mon_walk *walk, tstr_array *parts, uint32_t depth) {
     owned_tstring last;
     CHECK_STATUS(tstr_array_pop(parts, &last.pointer));
     owned_tstring parent;
@@ -185,13 +185,13 @@ static lc_status walk_wildcard(const mon_walk *walk, tstr_array *parts, uint32_t
     return LC_OK;
 }
 
-static lc_status walk_children(const mon_walk *walk, tstr_array *parts, tree_node *node, uint32_t depth) {
+lc_status walk_children(const mon_walk *walk, tstr_array *parts, tree_node *node, uint32_t depth) {
     child_walk child = {walk, parts, depth};
     CHECK_STATUS(tree_foreach(walk->registered, node, 0, walk_tree_child, &child));
     return LC_OK;
 }
 
-static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth) {
+lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth) {
     if ((depth >= 2 && !(walk->flags & bn_qf_subtree)) || walk->answer->too_large)
         return LC_OK;
     owned_tstring name;
@@ -219,7 +219,7 @@ static lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array 
 // --- The query
 
 // `inout_total`: the number of parts of all names so far.
-static lc_status add_registration(tree *registered, const bn_binding *binding, uint32_t *inout_total) {
+lc_status add_registration(tree *registered, const bn_binding *binding, uint32_t *inout_total) {
     const bn_attrib *attribute = nullptr;
     CHECK_STATUS(bn_binding_get_attrib(binding, bn_attrib_capability_mask, &attribute));
     CHECK_NULL(attribute);
@@ -251,7 +251,7 @@ static lc_status add_registration(tree *registered, const bn_binding *binding, u
     return LC_OK;
 }
 
-static lc_status answer_node(const mon_walk *walk, const bn_node_info *info, const bn_binding *binding) {
+lc_status answer_node(const mon_walk *walk, const bn_node_info *info, const bn_binding *binding) {
     const char *name = bn_binding_get_name_quick(binding);
     const tstr_array *known = nullptr;
     CHECK_STATUS(bn_binding_get_name_parts_const(binding, &known, nullptr));
@@ -277,7 +277,7 @@ static lc_status answer_node(const mon_walk *walk, const bn_node_info *info, con
     }
 }
 
-static lc_status move_to_response(bn_response_msg *response, bn_binding_array *found, uint32_t node_id) {
+lc_status move_to_response(bn_response_msg *response, bn_binding_array *found, uint32_t node_id) {
     const uint32_t count = bn_binding_array_length_quick(found);
     for (uint32_t i = 0; i < count; i++) {
         owned_binding binding;
@@ -290,7 +290,7 @@ static lc_status move_to_response(bn_response_msg *response, bn_binding_array *f
     return LC_OK;
 }
 
-static lc_status refuse_large_answer(const bn_request_msg *request, bn_response_msg **inout_response) {
+lc_status refuse_large_answer(const bn_request_msg *request, bn_response_msg **inout_response) {
     CHECK_STATUS(bn_response_msg_free(inout_response));
     CHECK_STATUS(bn_query_response_msg_create(inout_response,
                                               static_cast<uint32_t>(bn_request_get_msg_id(request)),
@@ -298,9 +298,11 @@ static lc_status refuse_large_answer(const bn_request_msg *request, bn_response_
     return LC_OK;
 }
 
-static void free_tree(tree *registered) {
+void free_tree(tree *registered) {
     (void)tree_free(&registered);
 }
+
+} // namespace
 
 lc_status mdc_dispatch_mon_request(gcl_session *session, bn_request_msg *request, mdc_mon_get_function get,
                                    void *get_data, mdc_mon_iterate_function iterate, void *iterate_data) {
@@ -360,9 +362,7 @@ struct change_entry {
     bn_binding_array *new_values;
 };
 
-} // namespace
-
-static lc_status add_renamed(bn_binding_array *out, const bn_binding *value, const char *name) {
+lc_status add_renamed(bn_binding_array *out, const bn_binding *value, const char *name) {
     if (!out)
         return LC_OK;
     owned_binding copy;
@@ -372,13 +372,13 @@ static lc_status add_renamed(bn_binding_array *out, const bn_binding *value, con
     return LC_OK;
 }
 
-static lc_status change_add(const change_entry *entry) {
+lc_status change_add(const change_entry *entry) {
     CHECK_CONDITION(entry->new_value != nullptr && entry->old_value == nullptr);
     CHECK_STATUS(add_renamed(entry->new_values, entry->new_value, entry->name));
     return LC_OK;
 }
 
-static lc_status change_delete(const change_entry *entry) {
+lc_status change_delete(const change_entry *entry) {
     CHECK_CONDITION(entry->old_value != nullptr && entry->new_value == nullptr);
     CHECK_STATUS(add_renamed(entry->old_values, entry->old_value, entry->name));
     if (!entry->new_values)
@@ -392,20 +392,20 @@ static lc_status change_delete(const change_entry *entry) {
     return LC_OK;
 }
 
-static lc_status change_modify(const change_entry *entry) {
+lc_status change_modify(const change_entry *entry) {
     CHECK_CONDITION(entry->old_value != nullptr && entry->new_value != nullptr);
     CHECK_STATUS(add_renamed(entry->old_values, entry->old_value, entry->name));
     CHECK_STATUS(add_renamed(entry->new_values, entry->new_value, entry->name));
     return LC_OK;
 }
 
-static const struct {
+const struct {
     const char *type;
     lc_status (*take)(const change_entry *entry);
 } change_types[] = {{"add", change_add}, {"delete", change_delete}, {"modify", change_modify}};
 
-static lc_status take_change(bn_binding_array *bindings, const char *entry_name, bn_binding_array *old_values,
-                             bn_binding_array *new_values) {
+lc_status take_change(bn_binding_array *bindings, const char *entry_name, bn_binding_array *old_values,
+                      bn_binding_array *new_values) {
     owned_tstring type, name;
     CHECK_STATUS(bn_binding_array_get_value_tstr_by_name_rel(bindings, entry_name, "change_type", nullptr,
                                                              &type.pointer));
@@ -427,6 +427,8 @@ static lc_status take_change(bn_binding_array *bindings, const char *entry_name,
     LC_LOG(LC_LOG_ERR, "Unexpected change type %s under binding %s", ts_str(type.pointer), entry_name);
     return LC_OK;
 }
+
+} // namespace
 
 lc_status mdc_event_config_change_notif_extract(bn_binding_array *bindings, bn_binding_array **out_old,
                                                 bn_binding_array **out_new) {

@@ -20,11 +20,13 @@
 #include "runtime/guards.h"
 #include "runtime/logging.h"
 
-static constexpr uint32_t TUNNELS_OF_THE_SYSTEM = 22;
+namespace {
 
-static constexpr platform_limits defaults = {.max_user_tunnels = 200, .max_interfaces = 128};
+constexpr uint32_t TUNNELS_OF_THE_SYSTEM = 22;
 
-static const struct {
+constexpr platform_limits defaults = {.max_user_tunnels = 200, .max_interfaces = 128};
+
+const struct {
     const char *name;
     size_t offset;
     uint32_t least, most;
@@ -33,14 +35,14 @@ static const struct {
     {"max_interfaces", offsetof(platform_limits, max_interfaces), 1, 65535},
 };
 
-static const char *skip_blanks(const char *text) {
+const char *skip_blanks(const char *text) {
     while (*text == ' ' || *text == '\t')
         text++;
     return text;
 }
 
 // Applies one line to the limits; false for a bad line.
-static bool take_line(const char *line, platform_limits *limits) {
+bool take_line(const char *line, platform_limits *limits) {
     const char *at = skip_blanks(line);
     if (*at == '\0' || *at == '#')
         return true;
@@ -62,6 +64,8 @@ static bool take_line(const char *line, platform_limits *limits) {
     }
     return false;
 }
+
+} // namespace
 
 platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
     const cancel_off_guard whole; // the file must be closed
@@ -101,13 +105,17 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
     return limits;
 }
 
-static platform_limits current;
-static pthread_once_t current_once = PTHREAD_ONCE_INIT;
+namespace {
 
-static const platform_limits *limits_of_this_run() {
+platform_limits current;
+pthread_once_t current_once = PTHREAD_ONCE_INIT;
+
+const platform_limits *limits_of_this_run() {
     pthread_once(&current_once, [] { current = platform_limits_read(PLATFORM_CONF_PATH); });
     return &current;
 }
+
+} // namespace
 
 uint32_t get_max_user_tunnel_number() {
     return limits_of_this_run()->max_user_tunnels;

@@ -21,7 +21,11 @@
 
 int32_t g_qvif_skfd = -1;
 
-static std::atomic<int> events_without_transport;
+namespace {
+
+std::atomic<int> events_without_transport;
+
+} // namespace
 
 void qvif_network_init_sockets() {
     if (__atomic_load_n(&g_qvif_skfd, __ATOMIC_ACQUIRE) >= 0)

@@ -37,7 +37,12 @@ lc_status array_std_takeover_func(void **inout_element, void **out_slot) {
     *inout_element = nullptr;
     return LC_OK;
 }
-static void free_nothing(void *) {}
+
+namespace {
+
+void free_nothing(void *) {}
+
+} // namespace
 
 // --- Options and life
 
@@ -78,9 +83,13 @@ lc_status array_options_set(array *list, const array_options *options) {
     return LC_OK;
 }
 
-static void release_record(array *list) {
+namespace {
+
+void release_record(array *list) {
     free(list);
 }
+
+} // namespace
 
 lc_status array_new(array **out, const array_options *options) {
     CHECK_NULL(out);
@@ -107,10 +116,14 @@ void array_place(array *record, const array_options *options, void **elements, u
     record->placed_record = record->placed_elements = 1;
 }
 
-static void give(array *list, void *element) {
+namespace {
+
+void give(array *list, void *element) {
     if (element)
         list->free(element);
 }
+
+} // namespace
 
 lc_status array_free(array **inout) {
     CHECK_NULL(inout);
@@ -143,7 +156,9 @@ lc_status array_empty(array *list) {
     return LC_OK;
 }
 
-static lc_status make_room(array *list, uint64_t length) {
+namespace {
+
+lc_status make_room(array *list, uint64_t length) {
     CHECK_CONDITION(length <= array_size_max);
     uint64_t capacity = list->capacity;
     while (capacity < length)
@@ -160,6 +175,8 @@ static lc_status make_room(array *list, uint64_t length) {
     list->capacity = static_cast<uint32_t>(capacity);
     return LC_OK;
 }
+
+} // namespace
 
 // --- Reading
 
@@ -188,7 +205,9 @@ lc_status array_peek(const array *list, void **out_element) {
 
 // --- Placing
 
-static lc_status copy_of(const array *list, const void *element, void **out) {
+namespace {
+
+lc_status copy_of(const array *list, const void *element, void **out) {
     *out = nullptr;
     if (!element)
         return LC_OK;
@@ -199,7 +218,7 @@ static lc_status copy_of(const array *list, const void *element, void **out) {
 
 // Runs a _takeover operation with a copy of the element, and frees the copy if the operation didn't take it.
 template <typename Operation>
-static lc_status with_copy(array *list, const void *element, Operation operation) {
+lc_status with_copy(array *list, const void *element, Operation operation) {
     CHECK_NULL(list);
     void *copy = nullptr;
     CHECK_QUIET(copy_of(list, element, &copy));
@@ -210,7 +229,7 @@ static lc_status with_copy(array *list, const void *element, Operation operation
 
 // Clears `sorted` if the new element at `index` is out of order with its neighbours. An array of one element
 // is sorted; nulls never are.
-static void note_order(array *list, uint32_t index) {
+void note_order(array *list, uint32_t index) {
     if (!list->sorted)
         return;
     void **at = &list->elements[index];
@@ -218,6 +237,8 @@ static void note_order(array *list, uint32_t index) {
         (index + 1 < list->length && list->compare(at, at + 1) > 0))
         list->sorted = list->length == 1 && *at;
 }
+
+} // namespace
 
 lc_status array_set_takeover(array *list, uint32_t index, void **inout_element) {
     CHECK_NULL(list);
@@ -258,9 +279,11 @@ lc_status array_insert_takeover(array *list, uint32_t index, void **inout_elemen
     return LC_OK;
 }
 
+namespace {
+
 // Applies the policy to a new element that equals the one at `index`. `out_done`: the new one isn't to be
 // inserted.
-static lc_status meet_equal(array *list, uint32_t index, void **inout_element, bool *out_done) {
+lc_status meet_equal(array *list, uint32_t index, void **inout_element, bool *out_done) {
     *out_done = true;
     if (list->duplicate_policy == array_dup_refuse)
         return LC_EXISTS;
@@ -272,6 +295,8 @@ static lc_status meet_equal(array *list, uint32_t index, void **inout_element, b
     *out_done = false;
     return array_delete(list, index);
 }
+
+} // namespace
 
 lc_status array_append_no_dup_takeover(array *list, void **inout_element) {
     CHECK_NULL(list);
@@ -390,11 +415,15 @@ lc_status array_sort(array *list) {
     return LC_OK;
 }
 
-static lc_status told(uint32_t index, uint32_t *out_index) {
+namespace {
+
+lc_status told(uint32_t index, uint32_t *out_index) {
     if (out_index)
         *out_index = index;
     return LC_OK;
 }
+
+} // namespace
 
 lc_status array_binary_search(const array *list, const void *key, uint32_t *out_index) {
     CHECK_NULL(list);
@@ -483,7 +512,9 @@ int array_equal(const array *a, const array *b) {
     return 1;
 }
 
-static lc_status walk(array *list, array_foreach_function function, void *data, bool deletes) {
+namespace {
+
+lc_status walk(array *list, array_foreach_function function, void *data, bool deletes) {
     CHECK_NULL(list);
     CHECK_NULL(function);
     lc_status result = LC_OK;
@@ -516,6 +547,9 @@ static lc_status walk(array *list, array_foreach_function function, void *data, 
     }
     return result;
 }
+
+} // namespace
+
 lc_status array_foreach(array *list, array_foreach_function function, void *data) {
     return walk(list, function, data, false);
 }

@@ -14,17 +14,23 @@ struct array_index {
 
 constexpr uint32_t INDEX_MIN_LENGTH = 16;
 
-static uint32_t changes_now(const array *list) {
+namespace {
+
+uint32_t changes_now(const array *list) {
     return list->key_changes ? list->key_changes->load(std::memory_order_relaxed) : 0;
 }
+
+} // namespace
 
 void array_index_drop(const array *list) {
     free(list->index);
     list->index = nullptr;
 }
 
+namespace {
+
 // The slot of an equal element, or else the free slot where the key belongs.
-static uint32_t *slot_of(const array *list, const void *key) {
+uint32_t *slot_of(const array *list, const void *key) {
     const uint32_t mask = list->index->slot_count - 1;
     uint32_t at = list->hash(key) & mask;
     while (list->index->slots[at]) {
@@ -36,7 +42,7 @@ static uint32_t *slot_of(const array *list, const void *key) {
     return &list->index->slots[at];
 }
 
-static bool make_index(const array *list) {
+bool make_index(const array *list) {
     uint32_t count = 64;
     while (count < 3 * uint64_t{list->length} && count < 0x40000000)
         count *= 2;
@@ -51,7 +57,7 @@ static bool make_index(const array *list) {
     return true;
 }
 
-static bool bring_up_to_date(const array *list) {
+bool bring_up_to_date(const array *list) {
     // A key that has changed inside an element makes its entry wrong, and so does an array that got shorter.
     if (list->index &&
         (list->index->key_changes != changes_now(list) || list->index->indexed > list->length ||
@@ -70,6 +76,8 @@ static bool bring_up_to_date(const array *list) {
     }
     return true;
 }
+
+} // namespace
 
 bool array_index_find(const array *list, const void *key, uint32_t *out_position, bool *out_found) {
     if (!list->hash || !key || list->length < INDEX_MIN_LENGTH || !bring_up_to_date(list))

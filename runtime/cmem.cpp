@@ -91,18 +91,20 @@ static_assert(offsetof(cmem_conf, key) == 52 && offsetof(cmem_conf, zero) == 56)
 static_assert(offsetof(cmem_registry, conf) == 336000 && offsetof(cmem_registry, state) == 361600);
 static_assert(sizeof(cmem_registry) == 361608);
 
-static cmem_registry *registry;
-static bool created_here[MAX_BLOCKS]; // by this process, or by the one from which it was forked
-static pthread_mutex_t registry_lock = PTHREAD_MUTEX_INITIALIZER;
+namespace {
+
+cmem_registry *registry;
+bool created_here[MAX_BLOCKS]; // by this process, or by the one from which it was forked
+pthread_mutex_t registry_lock = PTHREAD_MUTEX_INITIALIZER;
 
 // To a multiple of `page`, without overflow.
-static uint64_t round_up(uint64_t length, uint64_t page) {
+uint64_t round_up(uint64_t length, uint64_t page) {
     return length > UINT64_MAX - page ? UINT64_MAX / page * page : (length + page - 1) / page * page;
 }
 
 // --- mem.conf
 
-static bool parse_node(const char *word, int32_t *out) {
+bool parse_node(const char *word, int32_t *out) {
     if (strcmp(word, "inter") == 0)
         *out = NODE_INTERLEAVED;
     else if (strcmp(word, "local") == 0)
@@ -114,11 +116,11 @@ static bool parse_node(const char *word, int32_t *out) {
     return true;
 }
 
-static bool huge_pages_supported() {
+bool huge_pages_supported() {
     return access("/sys/kernel/mm/hugepages/hugepages-2048kB", F_OK) == 0;
 }
 
-static bool parse_page_size(const char *word, uint64_t *out) {
+bool parse_page_size(const char *word, uint64_t *out) {
     if (strcmp(word, "normal") == 0)
         *out = NORMAL_PAGE;
     else if (strcmp(word, "huge") == 0)
@@ -129,7 +131,7 @@ static bool parse_page_size(const char *word, uint64_t *out) {
 }
 
 // The next word of a line, which is ended with a NUL in place; an empty word at the end of the line.
-static char *next_word(char **inout_text) {
+char *next_word(char **inout_text) {
     char *word = *inout_text + strspn(*inout_text, " \t");
     char *end = word + strcspn(word, " \t");
     *inout_text = *end ? end + 1 : end;
@@ -138,7 +140,7 @@ static char *next_word(char **inout_text) {
 }
 
 // A hexadecimal number of at most `limit`; 0, which means no key and no address, for anything else.
-static uint64_t parse_hex(const char *word, uint64_t limit) {
+uint64_t parse_hex(const char *word, uint64_t limit) {
     char *end = nullptr;
     errno = 0;
     const unsigned long long number = strtoull(word, &end, 16);
@@ -147,7 +149,7 @@ static uint64_t parse_hex(const char *word, uint64_t limit) {
 
 // False for a line that is ignored; `out_wrong` says what is wrong with it, null for a comment or an empty
 // line.
-static bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) {
+bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) {
     *out_wrong = nullptr;
     const char *name = next_word(&line);
     if (name[0] == '#' || name[0] == '\0')
@@ -170,7 +172,7 @@ static bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) 
 // Calls take(entry) for each valid line until that returns false, and fail(what is wrong, line, line number)
 // for each invalid one. Returns 0, or the errno if the file can't be read.
 template <typename Take, typename Fail>
-static int read_conf(const char *path, const Take &take, const Fail &fail) {
+int read_conf(const char *path, const Take &take, const Fail &fail) {
     FILE *file = fopen(path, "re");
     char line[CONF_LINE_BYTES], whole[CONF_LINE_BYTES];
     cmem_conf entry;
@@ -200,7 +202,7 @@ static int read_conf(const char *path, const Take &take, const Fail &fail) {
 
 // Loads mem.conf into a registry whose state is loading. False, logged, if the file can't be read; no entry
 // is then set.
-static bool load_conf(cmem_registry *fresh) {
+bool load_conf(cmem_registry *fresh) {
     uint32_t count = 0;
     const int error = read_conf(
         CMEM_CONF_PATH,
@@ -217,6 +219,8 @@ static bool load_conf(cmem_registry *fresh) {
     }
     return error == 0;
 }
+
+} // namespace
 
 cmem_conf_faults cmem_check_conf(const char *path, const char *name) {
     cmem_conf_faults faults = {};
@@ -240,20 +244,22 @@ cmem_conf_faults cmem_check_conf(const char *path, const char *name) {
 
 // --- The registry
 
+namespace {
+
 // The usable bytes of a segment, which consists of whole pages; 0 if it can't be queried.
-static uint64_t segment_bytes(int id) {
+uint64_t segment_bytes(int id) {
     shmid_ds status = {};
     return shmctl(id, IPC_STAT, &status) == 0 ? round_up(status.shm_segsz, NORMAL_PAGE) : 0;
 }
 
-[[noreturn]] static void attach_failed() {
+[[noreturn]] void attach_failed() {
     QV_LOG(LC_LOG_ERR, "%s: Cannot attach to shmem, err=%s\n", "cmem_attach_registry", strerror(errno));
     abort();
 }
 
 // Loads the configuration into the registry, or waits for the process that is loading it. False, logged, if
 // that process doesn't finish. If this process can't read the file, the next one tries again.
-static bool fill_registry(cmem_registry *fresh) {
+bool fill_registry(cmem_registry *fresh) {
     for (unsigned waited = 0;; waited++) {
         uint32_t state = REGISTRY_EMPTY;
         if (fresh->state.compare_exchange_strong(state, REGISTRY_LOADING)) {
@@ -278,7 +284,7 @@ static bool fill_registry(cmem_registry *fresh) {
     return false;
 }
 
-static cmem_registry *attach_registry() {
+cmem_registry *attach_registry() {
     const mutex_guard guard(&registry_lock);
     if (registry)
         return registry;
@@ -295,19 +301,23 @@ static cmem_registry *attach_registry() {
     return registry;
 }
 
+} // namespace
+
 bool cmem_attach_registry() {
     const cancel_off_guard uncancelled;
     return attach_registry() != nullptr;
 }
 
-static cmem_block *find_block(cmem_registry *known, const char *name) {
+namespace {
+
+cmem_block *find_block(cmem_registry *known, const char *name) {
     for (cmem_block &block : known->blocks)
         if (block.in_use && strncmp(block.name, name, NAME_BYTES - 1) == 0)
             return &block;
     return nullptr;
 }
 
-static cmem_block *claim_block(cmem_registry *known) {
+cmem_block *claim_block(cmem_registry *known) {
     for (cmem_block &block : known->blocks) {
         uint32_t expected = 0;
         if (block.in_use.compare_exchange_strong(expected, 1))
@@ -316,13 +326,13 @@ static cmem_block *claim_block(cmem_registry *known) {
     return nullptr;
 }
 
-static void free_block(cmem_block *block) {
+void free_block(cmem_block *block) {
     memset(block->name, 0, sizeof block->name);
     block->in_use = 0;
 }
 
 // Whether the process has ended but has not been waited for. Its files in /proc still exist.
-static bool is_zombie(int32_t pid) {
+bool is_zombie(int32_t pid) {
     char path[64], text[256] = {};
     snprintf(path, sizeof path, "/proc/%d/stat", pid);
     const int fd = open(path, O_RDONLY | O_CLOEXEC);
@@ -338,7 +348,7 @@ static bool is_zombie(int32_t pid) {
 // Whether the creator of a block is still running. A process exists if it has a numa_maps file, or on a
 // kernel without those, if it can be signalled. A record with our own process id which we didn't create is
 // from an earlier process that had the same id.
-static bool creator_lives(const cmem_registry *known, const cmem_block *block) {
+bool creator_lives(const cmem_registry *known, const cmem_block *block) {
     const int32_t pid = block->pid;
     if (pid == getpid())
         return created_here[block - known->blocks];
@@ -352,7 +362,7 @@ static bool creator_lives(const cmem_registry *known, const cmem_block *block) {
     return exists && !is_zombie(pid);
 }
 
-static const cmem_conf *find_conf(const cmem_registry *known, const char *name) {
+const cmem_conf *find_conf(const cmem_registry *known, const char *name) {
     for (const cmem_conf &entry : known->conf)
         if (entry.name[0] && strncmp(entry.name, name, NAME_BYTES - 1) == 0)
             return &entry;
@@ -360,7 +370,7 @@ static const cmem_conf *find_conf(const cmem_registry *known, const char *name) 
 }
 
 // Fills a record that this process has claimed.
-static void reset_block(cmem_block *block, const cmem_registry *known, const char *name, uint64_t length) {
+void reset_block(cmem_block *block, const cmem_registry *known, const char *name, uint64_t length) {
     static const cmem_conf unlisted = {{}, NORMAL_PAGE, 0, NODE_LOCAL, 0, 0};
     const cmem_conf *entry = find_conf(known, name);
     block->configured = entry != nullptr;
@@ -385,7 +395,7 @@ static void reset_block(cmem_block *block, const cmem_registry *known, const cha
 
 // The record for a name, either a free one or that of a creator that has ended; null, logged, if there is
 // none.
-static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t length) {
+cmem_block *take_block(cmem_registry *known, const char *name, uint64_t length) {
     cmem_block *block = find_block(known, name);
     if (!block) {
         block = claim_block(known);
@@ -407,8 +417,6 @@ static cmem_block *take_block(cmem_registry *known, const char *name, uint64_t l
     }
     return block;
 }
-
-namespace {
 
 // The semaphore, from the search for a name until its record is filled.
 struct creation_lock {
@@ -434,10 +442,8 @@ struct creation_lock {
     bool held;
 };
 
-} // namespace
-
 // The filled record of a block that this process may create; null, logged, if it may not.
-static cmem_block *claim_name(cmem_registry *known, const char *name, uint64_t length) {
+cmem_block *claim_name(cmem_registry *known, const char *name, uint64_t length) {
     const creation_lock lock;
     if (!lock.held) {
         QV_LOG(LC_LOG_ERR, "%s: cannot lock the registry for memory block %s, err=%s\n", "cmem_create_block",
@@ -452,7 +458,7 @@ static cmem_block *claim_name(cmem_registry *known, const char *name, uint64_t l
     return block;
 }
 
-static void place_on_node(void *memory, const cmem_block *block) {
+void place_on_node(void *memory, const cmem_block *block) {
     if (numa_available() < 0)
         return;
     if (block->node > numa_max_node())
@@ -464,6 +470,8 @@ static void place_on_node(void *memory, const cmem_block *block) {
     else
         numa_interleave_memory(memory, block->length, numa_all_nodes_ptr);
 }
+
+} // namespace
 
 int32_t cmem_find_creator(const char *name, bool *out_lives) {
     *out_lives = false;

@@ -120,12 +120,16 @@ lc_status lc_check_forced(lc_status status, const char *function, const char *fi
 
 // --- Enumeration tables
 
-static const char *find_name(const lc_enum_entry *table, int32_t value) {
+namespace {
+
+const char *find_name(const lc_enum_entry *table, int32_t value) {
     for (const lc_enum_entry *entry = table; entry->name; entry++)
         if (entry->value == value)
             return entry->name;
     return nullptr;
 }
+
+} // namespace
 
 constexpr const char *NO_MAP = "ERROR-NO-MAP";
 
@@ -232,8 +236,10 @@ extern "C" size_t strlcat(char *dst, const char *src, size_t size) noexcept {
 
 constexpr size_t FIRST_FORMAT_BYTES = 100;
 
+namespace {
+
 // Formats into 100 bytes, and if that was too short once more into exactly as many as it takes.
-static lc_status format_new(char **out_string, uint32_t *out_length, const char *format, va_list arguments) {
+lc_status format_new(char **out_string, uint32_t *out_length, const char *format, va_list arguments) {
     *out_string = nullptr;
     if (out_length)
         *out_length = 0;
@@ -265,6 +271,8 @@ static lc_status format_new(char **out_string, uint32_t *out_length, const char 
     *out_string = text.take();
     return LC_OK;
 }
+
+} // namespace
 
 char *vsmprintf(const char *format, va_list arguments) {
     char *text = nullptr;
@@ -331,10 +339,14 @@ lc_status lc_getenv_ts(const char *name, char **out_text) {
     return LC_OK;
 }
 
-static int set_locked(const char *name, const char *value, int overwrite) {
+namespace {
+
+int set_locked(const char *name, const char *value, int overwrite) {
     const env_guard guard;
     return setenv(name, value, overwrite);
 }
+
+} // namespace
 
 lc_status lc_setenv(const char *name, const char *value, int overwrite) {
     CHECK_NULL(name);
@@ -367,17 +379,21 @@ struct lc_lock {
     pthread_key_t key;
 };
 
-static int64_t this_thread() {
+namespace {
+
+int64_t this_thread() {
     return static_cast<int64_t>(pthread_self());
 }
 
 // Destructor of the key: the thread has ended while it held the lock. A recursive lock is unlocked at every
 // level.
-static void release_at_thread_end(void *held) {
+void release_at_thread_end(void *held) {
     lc_lock *lock = static_cast<lc_lock *>(held);
     while (lock->locked && lock->owner == this_thread() && lc_lock_unlock(lock) == 0) {
     }
 }
+
+} // namespace
 
 int lc_lock_init(lc_lock **out_lock, int recursive) {
     if (!out_lock)

@@ -15,15 +15,19 @@ struct csys_display_buf {
 static_assert(sizeof(csys_display_buf) == 32);
 constexpr uint32_t OVERHEAD = sizeof(csys_display_buf) + 1; // descriptor and terminator
 
+namespace {
+
 // The caller's memory may end at any address, so the descriptor can be unaligned: it is copied in and out.
-static csys_display_buf load(const csys_display_buf *buffer) {
+csys_display_buf load(const csys_display_buf *buffer) {
     csys_display_buf copy;
     memcpy(&copy, static_cast<const void *>(buffer), sizeof copy);
     return copy;
 }
-static void save(csys_display_buf *buffer, const csys_display_buf *copy) {
+void save(csys_display_buf *buffer, const csys_display_buf *copy) {
     memcpy(static_cast<void *>(buffer), copy, sizeof *copy);
 }
+
+} // namespace
 
 csys_display_buf *csys_create_safe_display_buf_desc(void *memory, uint32_t size) {
     if (!memory || size < OVERHEAD)

@@ -41,15 +41,15 @@ struct posted_changes {
     fdic_event_array *changes;
 };
 
-} // namespace
-
-static lc_status fdic_libevent_record_free(void *key, uint32_t, void *value, void *) {
+lc_status fdic_libevent_record_free(void *key, uint32_t, void *value, void *) {
     auto *entry = static_cast<fdic_libevent_entry *>(value);
     loop_event_free(&entry->event);
     free(entry);
     free(key);
     return LC_OK;
 }
+
+} // namespace
 
 lc_status fdic_libevent_init(loop_context *loop, fdic_libevent **out) {
     CHECK_NULL(out);
@@ -94,7 +94,9 @@ lc_status fdic_libevent_set_fd_open_handler(fdic_libevent *bridge, fdic_handler 
     return LC_OK;
 }
 
-static fdic_libevent_entry *find_entry(const fdic_libevent *bridge, uint32_t id) {
+namespace {
+
+fdic_libevent_entry *find_entry(const fdic_libevent *bridge, uint32_t id) {
     void *value = nullptr;
     int found = 0;
     LOG_STATUS(ht_lookup(bridge->entries, &id, sizeof id, &found, nullptr, nullptr, &value));
@@ -103,7 +105,7 @@ static fdic_libevent_entry *find_entry(const fdic_libevent *bridge, uint32_t id)
 
 // --- From the loop
 
-static lc_status read_fired(int fd, const fdic_libevent_entry *entry) {
+lc_status read_fired(int fd, const fdic_libevent_entry *entry) {
     const fdic_event *interest = &entry->interest;
     CHECK_CONDITION(interest->fd == fd);
     if (interest->has_fd && interest->want_read)
@@ -111,7 +113,7 @@ static lc_status read_fired(int fd, const fdic_libevent_entry *entry) {
             interest->read_function(fd, FDIC_READABLE, interest->user_data, interest->read_argument));
     return LC_OK;
 }
-static lc_status write_fired(int fd, const fdic_libevent_entry *entry) {
+lc_status write_fired(int fd, const fdic_libevent_entry *entry) {
     const fdic_event *interest = &entry->interest;
     CHECK_CONDITION(interest->fd == fd);
     if (interest->has_fd && interest->want_write)
@@ -119,7 +121,7 @@ static lc_status write_fired(int fd, const fdic_libevent_entry *entry) {
             interest->write_function(fd, FDIC_WRITABLE, interest->user_data, interest->write_argument));
     return LC_OK;
 }
-static lc_status timer_fired(int fd, const fdic_libevent_entry *entry) {
+lc_status timer_fired(int fd, const fdic_libevent_entry *entry) {
     const fdic_event *interest = &entry->interest;
     CHECK_CONDITION(interest->has_timer);
     CHECK_STATUS(
@@ -127,7 +129,7 @@ static lc_status timer_fired(int fd, const fdic_libevent_entry *entry) {
     return LC_OK;
 }
 
-static lc_status run_fired(int fd, short flags, const fdic_libevent_entry *entry) {
+lc_status run_fired(int fd, short flags, const fdic_libevent_entry *entry) {
     // A failure ends this round of calls; each has been logged where it was found.
     if (flags & LOOP_READ)
         CHECK_QUIET(read_fired(fd, entry));
@@ -138,7 +140,7 @@ static lc_status run_fired(int fd, short flags, const fdic_libevent_entry *entry
     return LC_OK;
 }
 
-static void fdic_libevent_handler(int fd, short flags, void *data) {
+void fdic_libevent_handler(int fd, short flags, void *data) {
     auto *real = static_cast<fdic_libevent_entry *>(data);
     const fdic_libevent_entry entry = *real;
     if (flags & LOOP_SIGNAL) {
@@ -154,7 +156,7 @@ static void fdic_libevent_handler(int fd, short flags, void *data) {
 
 // --- Into the loop
 
-static lc_status drop_interest(fdic_libevent *bridge, const fdic_event *change) {
+lc_status drop_interest(fdic_libevent *bridge, const fdic_event *change) {
     fdic_libevent_entry *entry = find_entry(bridge, change->id);
     if (!entry)
         return LC_OK;
@@ -168,12 +170,12 @@ static lc_status drop_interest(fdic_libevent *bridge, const fdic_event *change) 
     return LC_OK;
 }
 
-static void free_entry(fdic_libevent_entry *entry) {
+void free_entry(fdic_libevent_entry *entry) {
     loop_event_free(&entry->event);
     free(entry);
 }
 
-static lc_status make_entry(fdic_libevent *bridge, uint32_t id, fdic_libevent_entry **out) {
+lc_status make_entry(fdic_libevent *bridge, uint32_t id, fdic_libevent_entry **out) {
     owned<fdic_libevent_entry, free_entry> entry(
         static_cast<fdic_libevent_entry *>(calloc(1, sizeof(fdic_libevent_entry))));
     CHECK_NULL(entry.pointer);
@@ -189,7 +191,7 @@ static lc_status make_entry(fdic_libevent *bridge, uint32_t id, fdic_libevent_en
     return LC_OK;
 }
 
-static lc_status take_interest(fdic_libevent *bridge, const fdic_event *change) {
+lc_status take_interest(fdic_libevent *bridge, const fdic_event *change) {
     if (!find_entry(bridge, change->id)) {
         fdic_libevent_entry *made = nullptr;
         CHECK_STATUS(make_entry(bridge, change->id, &made));
@@ -212,7 +214,7 @@ static lc_status take_interest(fdic_libevent *bridge, const fdic_event *change) 
     return LC_OK;
 }
 
-static lc_status carry_out(fdic_libevent *bridge, const fdic_event_array *changes) {
+lc_status carry_out(fdic_libevent *bridge, const fdic_event_array *changes) {
     // One failure doesn't keep the other changes from being applied; the first is returned.
     lc_status result = LC_OK;
     for (uint32_t i = 0; i < fdic_event_array_length_quick(changes); i++) {
@@ -225,7 +227,7 @@ static lc_status carry_out(fdic_libevent *bridge, const fdic_event_array *change
     return result;
 }
 
-static void carry_out_posted(loop_post *post, int carry) {
+void carry_out_posted(loop_post *post, int carry) {
     auto *posted = reinterpret_cast<posted_changes *>(post);
     if (carry)
         (void)carry_out(posted->bridge, posted->changes);
@@ -233,7 +235,7 @@ static void carry_out_posted(loop_post *post, int carry) {
     free(posted);
 }
 
-static lc_status post_changes(fdic_libevent *bridge, const fdic_event_array *changes) {
+lc_status post_changes(fdic_libevent *bridge, const fdic_event_array *changes) {
     auto *posted = static_cast<posted_changes *>(calloc(1, sizeof(posted_changes)));
     CHECK_NULL(posted);
     const lc_status status = fdic_event_array_duplicate(changes, &posted->changes);
@@ -246,6 +248,8 @@ static lc_status post_changes(fdic_libevent *bridge, const fdic_event_array *cha
     loop_post_work(bridge->loop, &posted->post);
     return LC_OK;
 }
+
+} // namespace
 
 lc_status fdic_libevent_callback(const fdic_event_array *changes, void *data) {
     CHECK_NULL(changes);

@@ -52,7 +52,9 @@ lc_status fdic_deinit(fdic **inout) {
     return LC_OK;
 }
 
-static fdic_event *find(const fdic_event_array *events, uint32_t id, uint32_t *out_index) {
+namespace {
+
+fdic_event *find(const fdic_event_array *events, uint32_t id, uint32_t *out_index) {
     fdic_event key{};
     key.id = id;
     if (fdic_event_array_binary_search(events, &key, out_index) != LC_OK)
@@ -62,12 +64,12 @@ static fdic_event *find(const fdic_event_array *events, uint32_t id, uint32_t *o
 
 // --- The compare step
 
-static bool is_usable(const fdic_event *event) {
+bool is_usable(const fdic_event *event) {
     return (event->has_fd && event->fd >= 0) || (event->has_timer && event->delay >= 0);
 }
 
 // Whether the callback knows the interest as it is.
-static bool is_told(const fdic_event *event, const fdic_event *reported) {
+bool is_told(const fdic_event *event, const fdic_event *reported) {
     if (!reported)
         return !event->active; // removed before it was ever reported
     if (event->active != reported->active || event->has_fd != reported->has_fd ||
@@ -79,7 +81,7 @@ static bool is_told(const fdic_event *event, const fdic_event *reported) {
     return !event->has_timer || event->delay == reported->delay;
 }
 
-static lc_status report(fdic *context, const fdic_event *event) {
+lc_status report(fdic *context, const fdic_event *event) {
     uint32_t index = 0;
     if (event->active) {
         CHECK_STATUS(fdic_event_array_insert_sorted(context->reported, event));
@@ -89,7 +91,7 @@ static lc_status report(fdic *context, const fdic_event *event) {
     return LC_OK;
 }
 
-static lc_status compare(fdic *context, bool all, fdic_event_array **out) {
+lc_status compare(fdic *context, bool all, fdic_event_array **out) {
     owned_events result;
     CHECK_STATUS(fdic_event_array_new(&result.pointer));
     const uint32_t count = fdic_event_array_length_quick(context->current);
@@ -117,7 +119,7 @@ static lc_status compare(fdic *context, bool all, fdic_event_array **out) {
     return LC_OK;
 }
 
-static lc_status tell_changes(fdic *context) {
+lc_status tell_changes(fdic *context) {
     owned_events changes;
     CHECK_STATUS(compare(context, false, &changes.pointer));
     if (fdic_event_array_length_quick(changes.pointer) && context->callback)
@@ -127,7 +129,7 @@ static lc_status tell_changes(fdic *context) {
 
 // --- Changes
 
-static lc_status add(fdic *context, fdic_event *event, int32_t *out_id) {
+lc_status add(fdic *context, fdic_event *event, int32_t *out_id) {
     event->context = context;
     event->id = context->next_id++;
     CHECK_STATUS(fdic_event_array_insert_sorted(context->current, event));
@@ -135,6 +137,8 @@ static lc_status add(fdic *context, fdic_event *event, int32_t *out_id) {
     CHECK_STATUS(tell_changes(context));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status fdic_event_add_fd(fdic *context, int32_t fd, int32_t want_read, int32_t want_write, void *user_data,
                             fdic_handler read_function, void *read_argument, fdic_handler write_function,
@@ -176,8 +180,10 @@ lc_status fdic_event_add_timer(fdic *context, int64_t delay_ms, void *user_data,
     return LC_OK;
 }
 
+namespace {
+
 // Finds the interest with this id. `what` was to be done with it, for the log line about an unknown id.
-static lc_status find_current(const fdic *context, int32_t id, const char *what, fdic_event **out) {
+lc_status find_current(const fdic *context, int32_t id, const char *what, fdic_event **out) {
     uint32_t index = 0;
     CHECK_NULL(context);
     *out = id > 0 ? find(context->current, static_cast<uint32_t>(id), &index) : nullptr;
@@ -186,6 +192,8 @@ static lc_status find_current(const fdic *context, int32_t id, const char *what,
     LC_LOG(LC_LOG_WARNING, "Asked to %s with bad id %d", what, id);
     return LC_NOT_FOUND;
 }
+
+} // namespace
 
 lc_status fdic_event_update_fd(fdic *context, int32_t id, int32_t want_read, int32_t want_write) {
     fdic_event *event = nullptr;

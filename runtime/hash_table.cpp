@@ -31,14 +31,14 @@ struct jenkins_state {
     }
 };
 
-} // namespace
-
-static uint32_t little_endian(const uint8_t *bytes, uint32_t count) {
+uint32_t little_endian(const uint8_t *bytes, uint32_t count) {
     uint32_t value = 0;
     for (uint32_t i = 0; i < std::min(count, 4u); i++)
         value |= uint32_t{bytes[i]} << (8 * i);
     return value;
 }
+
+} // namespace
 
 uint32_t ht_bjh_hash(const void *key, uint32_t length, uint32_t initial) {
     const auto *bytes = static_cast<const uint8_t *>(key);
@@ -75,17 +75,21 @@ void ht_default_options(ht_options *out) {
     out->key_equal_function = ht_key_equal_string_func;
 }
 
-static ht_entry **new_buckets(uint32_t count) {
+namespace {
+
+ht_entry **new_buckets(uint32_t count) {
     // NOLINTNEXTLINE(bugprone-sizeof-expression): a bucket is the pointer to its first entry
     return static_cast<ht_entry **>(calloc(count, sizeof(ht_entry *)));
 }
 
-static void release_record(ht *table) {
+void release_record(ht *table) {
     free(table);
 }
-static void release_entry(ht_entry *entry) {
+void release_entry(ht_entry *entry) {
     free(entry);
 }
+
+} // namespace
 
 lc_status ht_new(ht **out, const ht_options *options) {
     CHECK_NULL(out);
@@ -111,7 +115,9 @@ lc_status ht_new(ht **out, const ht_options *options) {
     return LC_OK;
 }
 
-static void resize(ht *table, uint32_t bucket_count) {
+namespace {
+
+void resize(ht *table, uint32_t bucket_count) {
     ht_entry **buckets = new_buckets(bucket_count);
     if (!buckets)
         return;
@@ -131,7 +137,7 @@ static void resize(ht *table, uint32_t bucket_count) {
 }
 
 // Grows or shrinks the table if its load is out of bounds.
-static void fit(ht *table) {
+void fit(ht *table) {
     const uint64_t entries = table->entry_count;
     uint32_t buckets = table->bucket_count;
     if (entries > uint64_t{ht_table_resize_growth_load_factor} * buckets && buckets < ht_table_size_max) {
@@ -149,7 +155,7 @@ static void fit(ht *table) {
 }
 
 // Unlinks one entry and frees it. It is gone even if its free function fails, which gives LC_GENERIC.
-static lc_status drop(ht *table, ht_entry **link) {
+lc_status drop(ht *table, ht_entry **link) {
     ht_entry *entry = *link;
     *link = entry->next;
     table->entry_count--;
@@ -160,7 +166,7 @@ static lc_status drop(ht *table, ht_entry **link) {
     return status == LC_OK ? LC_OK : LC_GENERIC;
 }
 
-static lc_status drop_all(ht *table) {
+lc_status drop_all(ht *table) {
     lc_status result = LC_OK;
     for (uint32_t i = 0; i < table->bucket_count; i++) {
         while (table->buckets[i]) {
@@ -171,6 +177,9 @@ static lc_status drop_all(ht *table) {
     }
     return result;
 }
+
+} // namespace
+
 lc_status ht_empty(ht *table) {
     CHECK_NULL(table);
     const lc_status status = drop_all(table);
@@ -193,18 +202,22 @@ lc_status ht_free(ht **inout) {
 
 // --- Entries
 
-static uint32_t length_of(const void *key, int32_t key_length) {
+namespace {
+
+uint32_t length_of(const void *key, int32_t key_length) {
     return key_length < 0 ? static_cast<uint32_t>(strlen(static_cast<const char *>(key)))
                           : static_cast<uint32_t>(key_length);
 }
 
 // The pointer that points to this key's entry, or the null pointer at the end of its chain.
-static ht_entry **find(const ht *table, const void *key, uint32_t length) {
+ht_entry **find(const ht *table, const void *key, uint32_t length) {
     ht_entry **link = &table->buckets[table->hash_function(key, length) % table->bucket_count];
     while (*link && !table->key_equal_function((*link)->key, (*link)->key_length, key, length))
         link = &(*link)->next;
     return link;
 }
+
+} // namespace
 
 lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value) {
     CHECK_NULL(table);

@@ -41,23 +41,25 @@ std::atomic<int32_t> G_logging_suspended;
 lc_log_state *G_log_state;
 lc_lock *G_log_state_lock;
 
-static int32_t lost_lines;               // because the daemon didn't read; G_log_state_lock guards it
-static thread_local bool inside_the_log; // this thread holds G_log_state_lock
+namespace {
+
+int32_t lost_lines;               // because the daemon didn't read; G_log_state_lock guards it
+thread_local bool inside_the_log; // this thread holds G_log_state_lock
 
 // --- Start and end
 
-static void report_lock_failure(int status, const char *function, int line) {
+void report_lock_failure(int status, const char *function, int line) {
     if (status != 0)
         (void)lc_check_status(status, function, LC_FILE_NAME, line);
 }
-static void lc_log_lock() {
+void lc_log_lock() {
     report_lock_failure(lc_lock_lock(G_log_state_lock), __func__, __LINE__);
 }
-static void lc_log_unlock() {
+void lc_log_unlock() {
     report_lock_failure(lc_lock_unlock(G_log_state_lock), __func__, __LINE__);
 }
 
-static lc_status create_state_lock() {
+lc_status create_state_lock() {
     if (G_log_state_lock)
         return LC_OK;
     if (lc_lock_init(&G_log_state_lock, 0) != 0)
@@ -66,9 +68,8 @@ static lc_status create_state_lock() {
     return LC_OK;
 }
 
-static lc_status init_locked(const char *process_name, const char *prefix, uint32_t default_flags,
-                             uint32_t default_component, int32_t max_level, int32_t facility,
-                             uint8_t destinations) {
+lc_status init_locked(const char *process_name, const char *prefix, uint32_t default_flags,
+                      uint32_t default_component, int32_t max_level, int32_t facility, uint8_t destinations) {
     const cancel_off_guard uncancelled;
     const lc_lock_guard guard(G_log_state_lock);
     const bool first = G_log_state == nullptr;
@@ -123,6 +124,8 @@ static lc_status init_locked(const char *process_name, const char *prefix, uint3
     return LC_OK;
 }
 
+} // namespace
+
 lc_status lc_log_init(const char *process_name, const char *prefix, uint32_t default_flags,
                       uint32_t default_component, int32_t max_level, int32_t facility, uint8_t destinations) {
     CHECK_NULL(process_name);
@@ -133,7 +136,9 @@ lc_status lc_log_init(const char *process_name, const char *prefix, uint32_t def
     return LC_OK;
 }
 
-static lc_status close_locked() {
+namespace {
+
+lc_status close_locked() {
     const cancel_off_guard uncancelled;
     const lc_lock_guard guard(G_log_state_lock);
     lc_log_state *state = G_log_state;
@@ -145,6 +150,8 @@ static lc_status close_locked() {
     return LC_OK;
 }
 
+} // namespace
+
 lc_status lc_log_close() {
     return G_log_state_lock ? close_locked() : LC_NULL;
 }
@@ -153,8 +160,10 @@ const char *lc_log_get_lls_process_name() {
     return G_log_state ? G_log_state->process_name : "";
 }
 
+namespace {
+
 // Sets the log up for a process that logs before lc_log_init, under the name of its program.
-static lc_status init_unnamed() {
+lc_status init_unnamed() {
     char path[32], name[80] = "";
     snprintf(path, sizeof path, "/proc/%d/cmdline", static_cast<int>(getpid()));
     FILE *file = fopen(path, "re");
@@ -170,8 +179,6 @@ static lc_status init_unnamed() {
 }
 
 // --- A line
-
-namespace {
 
 // What a line consists of, besides the caller's text.
 struct log_line {
@@ -189,11 +196,9 @@ struct line_format {
     size_t used;
 };
 
-} // namespace
-
-static void add(line_format *format, const char *pattern, ...) __attribute__((format(printf, 2, 3)));
+void add(line_format *format, const char *pattern, ...) __attribute__((format(printf, 2, 3)));
 // Removes an incomplete conversion from the end of a format that was cut.
-static void drop_half_conversion(line_format *format) {
+void drop_half_conversion(line_format *format) {
     const char *const end = format->text + format->used;
     for (const char *at = format->text; at < end;) {
         if (*at++ != '%')
@@ -212,7 +217,7 @@ static void drop_half_conversion(line_format *format) {
     }
 }
 
-static void add(line_format *format, const char *pattern, ...) {
+void add(line_format *format, const char *pattern, ...) {
     va_list arguments;
     va_start(arguments, pattern);
     const int length =
@@ -226,7 +231,7 @@ static void add(line_format *format, const char *pattern, ...) {
     }
 }
 
-static void add_stamp(line_format *format, const log_line *line) {
+void add_stamp(line_format *format, const log_line *line) {
     // The finest stamp that is asked for is used, so it comes first.
     static const struct {
         uint32_t flag;
@@ -254,19 +259,19 @@ static void add_stamp(line_format *format, const log_line *line) {
     }
 }
 
-static void add_thread_mark(line_format *format, const log_line *line) {
+void add_thread_mark(line_format *format, const log_line *line) {
     if (!lc_is_multithreaded || (line->flags & LC_LOG_FLAG_NO_THREAD))
         return;
     add(format, "TID %lu: ", static_cast<unsigned long>(syscall(SYS_gettid)));
 }
 
-static const char *component_name(uint32_t component) {
+const char *component_name(uint32_t component) {
     const char *name =
         lc_enum_to_string_quiet_null(lc_log_component_table, static_cast<int32_t>(component >> 16));
     return name ? name : "UNKNOWN_COMP";
 }
 
-static void build_body(line_format *body, const log_line *line, const char *format) {
+void build_body(line_format *body, const log_line *line, const char *format) {
     add_thread_mark(body, line);
     add_stamp(body, line);
     add(body, "[%s.%s]: ", component_name(line->component),
@@ -280,7 +285,7 @@ static void build_body(line_format *body, const log_line *line, const char *form
         add(body, "%s\n", format);
 }
 
-static void build_header(line_format *full, const log_line *line) {
+void build_header(line_format *full, const log_line *line) {
     const lc_log_state *state = line->state;
     if (!state->time_header || (line->flags & LC_LOG_FLAG_NO_HEADER))
         return;
@@ -294,7 +299,7 @@ static void build_header(line_format *full, const log_line *line) {
         add(full, "%s[%d]: ", state->process_name, static_cast<int>(state->process_id));
 }
 
-static void take_stamp(log_line *line, const timeval *now) {
+void take_stamp(log_line *line, const timeval *now) {
     lc_log_state *state = line->state;
     const bool relative = (line->flags & LC_LOG_FLAG_RELATIVE) != 0;
     line->stamp = *now;
@@ -306,7 +311,7 @@ static void take_stamp(log_line *line, const timeval *now) {
         timersub(now, &state->relative_base, &line->stamp);
 }
 
-static void tell_lost_lines(log_line *line) {
+void tell_lost_lines(log_line *line) {
     errno = 0;
     if (syslog_socket_send(&line->state->log_daemon, LC_LOG_ERR,
                            "messages lost due to non-blocking syslog (count=%d)", lost_lines) != EAGAIN)
@@ -315,8 +320,7 @@ static void tell_lost_lines(log_line *line) {
 
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wformat-nonliteral"
-static void write_out(const log_line *line, const line_format *full, const line_format *body,
-                      va_list arguments) {
+void write_out(const log_line *line, const line_format *full, const line_format *body, va_list arguments) {
     static const struct {
         uint8_t destination;
         FILE **stream;
@@ -342,7 +346,7 @@ static void write_out(const log_line *line, const line_format *full, const line_
 }
 #pragma GCC diagnostic pop
 
-static lc_status log_locked(log_line *line, int saved_errno, const char *format, va_list arguments) {
+lc_status log_locked(log_line *line, int saved_errno, const char *format, va_list arguments) {
     lc_log_state *state = G_log_state;
     if (!state)
         return LC_GENERIC;
@@ -375,6 +379,8 @@ static lc_status log_locked(log_line *line, int saved_errno, const char *format,
     state->last_line = now;
     return LC_OK;
 }
+
+} // namespace
 
 lc_status lc_log_internal(const char *function, const char *file, int line, uint32_t flags,
                           uint32_t component, int32_t level, const char *format, ...) {

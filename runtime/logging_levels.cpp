@@ -58,9 +58,11 @@ bool log_is_managed(const char *process_name) {
 
 // --- The level link
 
+namespace {
+
 // The link's target is the level as a decimal number. False if there is no link, or its target is anything
 // else.
-static bool read_level_link(int32_t *out_level) {
+bool read_level_link(int32_t *out_level) {
     char target[16];
     const ssize_t length = readlink(LEVEL_LINK, target, sizeof target - 1);
     if (length <= 0)
@@ -74,6 +76,8 @@ static bool read_level_link(int32_t *out_level) {
     return true;
 }
 
+} // namespace
+
 void log_take_system_level(lc_log_state *state) {
     int32_t level = LC_LOG_NOTICE;
     (void)read_level_link(&level);
@@ -81,14 +85,19 @@ void log_take_system_level(lc_log_state *state) {
     state->system_level = static_cast<int8_t>(level);
 }
 
+namespace {
+
 // `look`: stat or lstat.
-static timespec changed_at(const char *path, int (*look)(const char *, struct stat *)) {
+timespec changed_at(const char *path, int (*look)(const char *, struct stat *)) {
     struct stat status = {};
     return look(path, &status) == 0 ? status.st_mtim : timespec{};
 }
-static bool same_time(const timespec &a, const timespec &b) {
+bool same_time(const timespec &a, const timespec &b) {
     return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec;
 }
+
+} // namespace
+
 timespec log_level_link_time() {
     return changed_at(LEVEL_LINK, lstat);
 }
@@ -96,19 +105,23 @@ timespec log_time_zone_time() {
     return changed_at(TIME_ZONE_FILE, stat);
 }
 
-static bool has_console(const lc_log_state *state) {
+namespace {
+
+bool has_console(const lc_log_state *state) {
     return state->time_header != 0;
 }
-static bool overridden(const lc_log_state *state) {
+bool overridden(const lc_log_state *state) {
     return state->system_override && state->class_override;
 }
 
-static void make_current(lc_log_state *state, uint8_t level) {
+void make_current(lc_log_state *state, uint8_t level) {
     state->current_level = level;
     const int32_t own = lc_log_get_daemon_log_level();
     syslog_set_mask(own != -1 ? own : level);
     G_log_level = level;
 }
+
+} // namespace
 
 void log_poll_level_link(lc_log_state *state, time_t now) {
     if (!state->polls_level_link || state->level_link_looked == now)
@@ -145,9 +158,7 @@ struct locked_state {
     lc_log_state *const state;
 };
 
-} // namespace
-
-static lc_status set_system_level(int32_t level) {
+lc_status set_system_level(int32_t level) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
@@ -158,6 +169,8 @@ static lc_status set_system_level(int32_t level) {
         make_current(log.state, static_cast<uint8_t>(level));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status lc_log_set_max_log_level(const char *name) {
     int32_t level = 0;
@@ -183,14 +196,16 @@ int32_t lc_log_get_daemon_log_level() {
     return G_daemon_log_level;
 }
 
+namespace {
+
 // Makes the override level current, or the system level.
-static void settle_overrides(lc_log_state *state, bool overrides) {
+void settle_overrides(lc_log_state *state, bool overrides) {
     state->current_level = overrides ? state->override_level : static_cast<uint8_t>(state->system_level);
     if (!has_console(state))
         make_current(state, state->current_level);
 }
 
-static lc_status switch_override(int32_t system_wide, int32_t enable) {
+lc_status switch_override(int32_t system_wide, int32_t enable) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
@@ -203,13 +218,17 @@ static lc_status switch_override(int32_t system_wide, int32_t enable) {
     return LC_OK;
 }
 
+} // namespace
+
 lc_status lc_log_enable_override_log_level(int32_t system_wide, int32_t enable) {
     CHECK_STATUS(switch_override(system_wide, enable));
     return LC_OK;
 }
 
+namespace {
+
 // -1 means the system level, and turns the class's switch off.
-static lc_status set_override_level(int32_t level) {
+lc_status set_override_level(int32_t level) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
@@ -222,6 +241,8 @@ static lc_status set_override_level(int32_t level) {
     return LC_OK;
 }
 
+} // namespace
+
 lc_status lc_log_set_override_log_level(const char *name) {
     CHECK_NULL(name);
     int32_t level = 0;
@@ -231,7 +252,9 @@ lc_status lc_log_set_override_log_level(const char *name) {
     return LC_OK;
 }
 
-static lc_status save_levels(lc_log_levels *out) {
+namespace {
+
+lc_status save_levels(lc_log_levels *out) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
@@ -239,6 +262,9 @@ static lc_status save_levels(lc_log_levels *out) {
             log.state->system_override, log.state->class_override};
     return LC_OK;
 }
+
+} // namespace
+
 lc_status lc_log_save_levels(lc_log_levels *out) {
     CHECK_NULL(out);
     *out = {-1, G_log_level, G_log_level, 0, 0};
@@ -246,7 +272,9 @@ lc_status lc_log_save_levels(lc_log_levels *out) {
     return LC_OK;
 }
 
-static lc_status restore_levels(const lc_log_levels *saved) {
+namespace {
+
+lc_status restore_levels(const lc_log_levels *saved) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
@@ -258,6 +286,9 @@ static lc_status restore_levels(const lc_log_levels *saved) {
     settle_overrides(log.state, overridden(log.state));
     return LC_OK;
 }
+
+} // namespace
+
 lc_status lc_log_restore_levels(const lc_log_levels *saved) {
     CHECK_NULL(saved);
     CHECK_STATUS(restore_levels(saved));
@@ -274,7 +305,9 @@ lc_status lc_log_get_syslog_facility(int32_t *out_facility) {
     return LC_OK;
 }
 
-static void facility_from_file(const char *process_name, int32_t *facility) {
+namespace {
+
+void facility_from_file(const char *process_name, int32_t *facility) {
     FILE *file = fopen(LC_LOG_FACILITY_FILE, "re");
     if (!file)
         return;
@@ -292,6 +325,8 @@ static void facility_from_file(const char *process_name, int32_t *facility) {
     }
     fclose(file);
 }
+
+} // namespace
 
 int32_t lc_log_get_facility(mdc *session, const char *process_name) {
     const cancel_off_guard uncancelled;

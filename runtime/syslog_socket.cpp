@@ -44,9 +44,13 @@ constexpr int64_t WAIT_STEP_NS = 500000;
 // in it.
 constexpr int64_t LEAST_STEP_NS = 1000;
 
+namespace {
+
 // Bit n is level n. setlogmask(3) isn't used, since its lock may be held by a thread that is blocked in
 // syslog(3).
-static std::atomic<int32_t> mask{0xff};
+std::atomic<int32_t> mask{0xff};
+
+} // namespace
 
 void syslog_set_mask(int32_t level) {
     mask = (1 << ((level + 1) & 31)) - 1;
@@ -58,7 +62,9 @@ void syslog_socket_close(syslog_socket *log) {
     log->fd = -1;
 }
 
-static int connect_as(syslog_socket *log, int type) {
+namespace {
+
+int connect_as(syslog_socket *log, int type) {
     // Before connect(): if the path changes in between, the next comparison finds a difference.
     struct stat file = {};
     if (stat(LOG_PATH, &file) != 0)
@@ -82,16 +88,18 @@ static int connect_as(syslog_socket *log, int type) {
 }
 
 // 0, or an errno. Most daemons have a datagram socket, some a stream.
-static int connect_to_daemon(syslog_socket *log) {
+int connect_to_daemon(syslog_socket *log) {
     const int result = connect_as(log, SOCK_DGRAM);
     return result == EPROTOTYPE ? connect_as(log, SOCK_STREAM) : result;
 }
 
 // Whether the path now leads to another socket than the one that we are connected to.
-static bool path_is_anothers(const syslog_socket *log) {
+bool path_is_anothers(const syslog_socket *log) {
     struct stat file = {};
     return stat(LOG_PATH, &file) == 0 && (file.st_dev != log->device || file.st_ino != log->inode);
 }
+
+} // namespace
 
 void syslog_socket_open(syslog_socket *log, const char *ident, bool with_pid, int32_t facility) {
     strlcpy(log->ident, ident, sizeof log->ident);
@@ -102,9 +110,11 @@ void syslog_socket_open(syslog_socket *log, const char *ident, bool with_pid, in
     (void)connect_to_daemon(log);
 }
 
+namespace {
+
 // Waits one step for room. False if no patience is left. No step uses up more patience than its own length:
 // on a machine so busy that this thread runs late, the daemon does too.
-static bool wait_for_room(syslog_socket *log) {
+bool wait_for_room(syslog_socket *log) {
     if (log->patience_ns <= 0)
         return false;
     const timespec step = {0, WAIT_STEP_NS};
@@ -117,7 +127,7 @@ static bool wait_for_room(syslog_socket *log) {
 }
 
 // Sends a line on the present connection. 0, or an errno.
-static int send_whole(syslog_socket *log, const char *line, size_t length) {
+int send_whole(syslog_socket *log, const char *line, size_t length) {
     size_t sent = 0;
     while (sent < length) {
         const ssize_t went = send(log->fd, line + sent, length - sent, MSG_DONTWAIT | MSG_NOSIGNAL);
@@ -137,7 +147,7 @@ static int send_whole(syslog_socket *log, const char *line, size_t length) {
 }
 
 // Sends a line and connects as often as needed, but gives up after two failures.
-static int send_line(syslog_socket *log, const char *line, size_t length) {
+int send_line(syslog_socket *log, const char *line, size_t length) {
     int result = ENOTCONN;
     for (int failures = 0; failures < 2;) {
         if (log->fd < 0) {
@@ -161,7 +171,7 @@ static int send_line(syslog_socket *log, const char *line, size_t length) {
 }
 
 // The head of a line as syslog(3) writes it, e.g. "<139>Jan  2 03:04:05 wccpd[123]: ".
-static size_t write_head(const syslog_socket *log, int32_t level, char *line, size_t size) {
+size_t write_head(const syslog_socket *log, int32_t level, char *line, size_t size) {
     // Month names independent of the locale.
     static const char months[][4] = {"Jan", "Feb", "Mar", "Apr", "May", "Jun",
                                      "Jul", "Aug", "Sep", "Oct", "Nov", "Dec"};
@@ -175,6 +185,8 @@ static size_t write_head(const syslog_socket *log, int32_t level, char *line, si
                                         months[local.tm_mon], local.tm_mday, local.tm_hour, local.tm_min,
                                         local.tm_sec, log->ident, process));
 }
+
+} // namespace
 
 int syslog_socket_vsend(syslog_socket *log, int32_t level, const char *format, va_list arguments) {
     static char line[LINE_BYTES];

@@ -20,13 +20,15 @@
 
 // --- Size
 
+namespace {
+
 // Up to a multiple of 4096 bytes, or of 128 for less than 4096.
-static uint64_t rounded(uint64_t size) {
+uint64_t rounded(uint64_t size) {
     const uint64_t mask = size >= tb_size_chunk_size_mask + 1 ? tb_size_chunk_size_mask : tb_size_initial - 1;
     return std::min<uint64_t>((size + mask) & ~mask, tb_size_max);
 }
 
-static uint64_t size_for(const tbuffer *buffer, uint64_t need) {
+uint64_t size_for(const tbuffer *buffer, uint64_t need) {
     uint64_t size = buffer->size;
     if (size < need) {
         size = uint64_t{std::max(buffer->size, tb_size_initial)} * tb_size_growth_factor;
@@ -38,7 +40,7 @@ static uint64_t size_for(const tbuffer *buffer, uint64_t need) {
     return size;
 }
 
-static lc_status fit(tbuffer *buffer, uint64_t need) {
+lc_status fit(tbuffer *buffer, uint64_t need) {
     CHECK_CONDITION(!buffer->constant);
     need = std::max<uint64_t>(need, tb_size_initial);
     if (need > tb_size_max) {
@@ -58,10 +60,12 @@ static lc_status fit(tbuffer *buffer, uint64_t need) {
     return LC_OK;
 }
 
-static void ended(tbuffer *buffer, uint32_t length) {
+void ended(tbuffer *buffer, uint32_t length) {
     buffer->length = length;
     buffer->buffer[length] = 0;
 }
+
+} // namespace
 
 // --- Life
 
@@ -239,7 +243,9 @@ lc_status tb_put_byte(tbuffer *buffer, uint32_t offset, uint8_t byte) {
     return tb_put_buf(buffer, offset, &byte, 1);
 }
 
-static lc_status get_number(const tbuffer *buffer, uint32_t offset, void *out, uint32_t size) {
+namespace {
+
+lc_status get_number(const tbuffer *buffer, uint32_t offset, void *out, uint32_t size) {
     CHECK_NULL(out);
     memset(out, 0, size);
     CHECK_NULL(buffer);
@@ -247,6 +253,8 @@ static lc_status get_number(const tbuffer *buffer, uint32_t offset, void *out, u
     memcpy(out, buffer->buffer + offset, size);
     return LC_OK;
 }
+
+} // namespace
 
 // Defines tb_put_uint32, tb_append_uint32 and tb_get_uint32 for the width 32, and so on.
 #define TB_NUMBER(width)                                                                                     \
@@ -269,12 +277,14 @@ lc_status tb_get_uint128(const tbuffer *buffer, uint32_t offset, uint8_t out[16]
 
 // --- Strings
 
-static uint32_t in_order(uint32_t number, int swap) {
+namespace {
+
+uint32_t in_order(uint32_t number, int swap) {
     return swap ? raw_word(to_be32(number)) : number;
 }
 
-static lc_status put_text(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
-                          const char *text, uint32_t length, uint32_t *out_written) {
+lc_status put_text(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap, const char *text,
+                   uint32_t length, uint32_t *out_written) {
     CHECK_CONDITION(length < tb_size_max && offset < tb_size_max);
     const uint32_t counted = length + (add_nul ? 1 : 0);
     uint32_t at = offset;
@@ -289,6 +299,9 @@ static lc_status put_text(tbuffer *buffer, uint32_t offset, int add_nul, int len
         *out_written = at + counted - offset;
     return LC_OK;
 }
+
+} // namespace
+
 lc_status tb_put_str(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
                      const char *text, int32_t length, uint32_t *out_written) {
     if (out_written)
@@ -331,10 +344,11 @@ lc_status tb_append_tstr_array(tbuffer *buffer, int add_nul, int swap, const tst
     return tb_put_tstr_array(buffer, buffer->length, add_nul, swap, array, nullptr);
 }
 
+namespace {
+
 // The position and length of the text in the buffer, without its NUL. `out_used` counts from `offset`.
-static lc_status find_text(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul,
-                           int length_word, int swap, uint32_t *out_start, uint32_t *out_length,
-                           uint32_t *out_used) {
+lc_status find_text(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
+                    int swap, uint32_t *out_start, uint32_t *out_length, uint32_t *out_used) {
     CHECK_NULL(buffer);
     uint32_t start = offset, counted;
     if (length_word) {
@@ -355,6 +369,9 @@ static lc_status find_text(const tbuffer *buffer, uint32_t offset, int32_t lengt
         *out_used = start + counted - offset;
     return LC_OK;
 }
+
+} // namespace
+
 lc_status tb_get_str(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
                      int swap, char **out_text, uint32_t *out_length, uint32_t *out_used) {
     CHECK_NULL(out_text);

@@ -8,9 +8,11 @@
 
 #include "runtime/guards.h"
 
-static void free_no_value(void *) {}
+namespace {
 
-static void free_node(void *memory) {
+void free_no_value(void *) {}
+
+void free_node(void *memory) {
     auto *node = static_cast<tree_node *>(memory);
     (void)array_free(&node->children);
     if (node->value)
@@ -18,15 +20,15 @@ static void free_node(void *memory) {
     free(node->name);
     free(node);
 }
-static int compare_nodes(const void *a, const void *b) {
+int compare_nodes(const void *a, const void *b) {
     return strcmp((*static_cast<const tree_node *const *>(a))->name,
                   (*static_cast<const tree_node *const *>(b))->name);
 }
 
-static void release_node(tree_node *node) {
+void release_node(tree_node *node) {
     free_node(node);
 }
-static lc_status new_node(tree *whole, const char *name, tree_node **out) {
+lc_status new_node(tree *whole, const char *name, tree_node **out) {
     *out = nullptr;
     owned<tree_node, release_node> node(static_cast<tree_node *>(calloc(1, sizeof(tree_node))));
     CHECK_NULL(node.pointer);
@@ -41,6 +43,8 @@ static lc_status new_node(tree *whole, const char *name, tree_node **out) {
     *out = node.take();
     return LC_OK;
 }
+
+} // namespace
 
 lc_status tree_options_get_defaults(tree_options *out) {
     CHECK_NULL(out);
@@ -64,12 +68,18 @@ lc_status tree_new(tree **out, const tree_options *options) {
     *out = whole;
     return LC_OK;
 }
-static void drop_value(tree_node *node) {
+
+namespace {
+
+void drop_value(tree_node *node) {
     void *value = node->value;
     node->value = nullptr;
     if (value)
         node->owner->options.free_value(value);
 }
+
+} // namespace
+
 lc_status tree_empty(tree *whole) {
     CHECK_NULL(whole);
     drop_value(whole->root);
@@ -85,7 +95,9 @@ lc_status tree_free(tree **inout) {
     return LC_OK;
 }
 
-static tree_node *child_of(const tree_node *node, const char *name) {
+namespace {
+
+tree_node *child_of(const tree_node *node, const char *name) {
     tree_node key{};
     key.name = const_cast<char *>(name);
     uint32_t index = 0;
@@ -94,7 +106,7 @@ static tree_node *child_of(const tree_node *node, const char *name) {
     return static_cast<tree_node *>(array_get_quick(node->children, index));
 }
 
-static lc_status make_child(tree_node *node, const char *name, tree_node **out) {
+lc_status make_child(tree_node *node, const char *name, tree_node **out) {
     tree_node *made = nullptr;
     CHECK_STATUS(new_node(node->owner, name, &made));
     void *slot = made;
@@ -105,6 +117,8 @@ static lc_status make_child(tree_node *node, const char *name, tree_node **out) 
     *out = made;
     return LC_OK;
 }
+
+} // namespace
 
 lc_status tree_set_node_value_by_path_str(tree *whole, tree_node *start, const char *path, void *value,
                                           int create, tree_node **out_node) {
@@ -178,13 +192,14 @@ struct tree_walk {
     void *data;
 };
 
-} // namespace
-
-static lc_status visit(array *, uint32_t, void *element, void *data) {
+lc_status visit(array *, uint32_t, void *element, void *data) {
     const auto *walk = static_cast<const tree_walk *>(data);
     auto *child = static_cast<tree_node *>(element);
     return walk->function(walk->whole, child, child->name, child->value, walk->data);
 }
+
+} // namespace
+
 lc_status tree_foreach(tree *whole, tree_node *node, uint32_t flags, tree_foreach_function function,
                        void *data) {
     CHECK_NULL(whole);

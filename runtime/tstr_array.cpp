@@ -4,23 +4,28 @@
 
 #include "runtime/guards.h"
 
-static lc_status dup_for_array(const void *element, void **out_copy) {
+namespace {
+
+lc_status dup_for_array(const void *element, void **out_copy) {
     tstring *copy = nullptr;
     CHECK_STATUS(ts_dup(static_cast<const tstring *>(element), &copy));
     *out_copy = copy;
     return LC_OK;
 }
-static void free_for_array(void *element) {
+void free_for_array(void *element) {
     ts_release(static_cast<tstring *>(element));
 }
-static int compare_for_array(const void *a, const void *b) {
+int compare_for_array(const void *a, const void *b) {
     return ts_cmp(*static_cast<const tstring *const *>(a), *static_cast<const tstring *const *>(b));
 }
-static void string_options(array_options *options) {
+void string_options(array_options *options) {
     options->compare = compare_for_array;
     options->duplicate = dup_for_array;
     options->free = free_for_array;
 }
+
+} // namespace
+
 TYPED_ARRAY_DEFINE(tstr_array, tstring *, string_options)
 
 lc_status tstr_array_new(tstr_array **out, const tstr_array_options *options) {
@@ -33,12 +38,14 @@ lc_status tstr_array_new(tstr_array **out, const tstr_array_options *options) {
 }
 
 namespace {
+
 // The start of the allocation of a packed array, followed by the slots, the string records and the texts. The
 // family's record comes first, so freeing it frees everything.
 struct packed {
     tstr_array family;
     array list;
 };
+
 } // namespace
 
 lc_status tstr_array_new_packed(tstr_array **out, uint32_t count, size_t text_bytes, tstring **out_records,

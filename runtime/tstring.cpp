@@ -22,7 +22,9 @@
 
 // --- Size
 
-static lc_status give_own_bytes(tstring *string, uint32_t size) {
+namespace {
+
+lc_status give_own_bytes(tstring *string, uint32_t size) {
     const bool placed = string->placed & ts_placed_bytes;
     auto *buffer = static_cast<char *>(placed ? malloc(size) : realloc(string->buffer, size));
     CHECK_NULL(buffer);
@@ -33,18 +35,18 @@ static lc_status give_own_bytes(tstring *string, uint32_t size) {
     string->size = size;
     return LC_OK;
 }
-static lc_status give_size(tstring *string, uint32_t size) {
+lc_status give_size(tstring *string, uint32_t size) {
     return size == string->size ? LC_OK : give_own_bytes(string, size);
 }
 
 // The size is halved while it is more than four times what is needed.
-static uint32_t shrunk(uint32_t size, uint64_t need) {
+uint32_t shrunk(uint32_t size, uint64_t need) {
     while (size > 4 * need && size > ts_size_initial)
         size = std::max(size / ts_resize_factor, ts_size_initial);
     return size;
 }
 
-static lc_status fit(tstring *string, int64_t length) {
+lc_status fit(tstring *string, int64_t length) {
     const int64_t need = std::max<int64_t>(length + 1, ts_size_initial);
     if (need > ts_size_max) {
         LC_LOG(LC_LOG_ERR, "maximum size exceeded: %d",
@@ -61,7 +63,7 @@ static lc_status fit(tstring *string, int64_t length) {
     return give_size(string, static_cast<uint32_t>(size));
 }
 
-static void ended(tstring *string, int32_t length) {
+void ended(tstring *string, int32_t length) {
     string->length = length;
     string->buffer[length] = 0;
     string->characters = string->utf8 ? utf8_count(string->buffer, length) : length;
@@ -69,7 +71,7 @@ static void ended(tstring *string, int32_t length) {
 
 // --- The one change
 
-static lc_status splice(tstring *string, int32_t at, int32_t removed, const char *bytes, int64_t added) {
+lc_status splice(tstring *string, int32_t at, int32_t removed, const char *bytes, int64_t added) {
     // The text may be part of the string itself (ts_append(s, s)), which moves when the buffer grows.
     owned_text copy;
     if (added > 0 && bytes >= string->buffer && bytes < string->buffer + string->size) {
@@ -90,7 +92,7 @@ static lc_status splice(tstring *string, int32_t at, int32_t removed, const char
     return shorter ? fit(string, length) : LC_OK;
 }
 
-static lc_status byte_offset(const tstring *string, int32_t offset, int32_t *out_bytes) {
+lc_status byte_offset(const tstring *string, int32_t offset, int32_t *out_bytes) {
     if (offset < 0 || offset > string->characters)
         FAIL_WITH(LC_NO_BUFFER_SPACE);
     if (!string->utf8) {
@@ -101,7 +103,7 @@ static lc_status byte_offset(const tstring *string, int32_t offset, int32_t *out
 }
 
 // The number of bytes of `count` characters from byte `at` on, or of as many as there are.
-static lc_status span(const tstring *string, int32_t at, int32_t count, int32_t *out_bytes) {
+lc_status span(const tstring *string, int32_t at, int32_t count, int32_t *out_bytes) {
     const int32_t rest = string->length - at;
     if (!string->utf8) {
         *out_bytes = std::min(count, rest);
@@ -110,6 +112,8 @@ static lc_status span(const tstring *string, int32_t at, int32_t count, int32_t 
     return utf8_skip(string->buffer + at, rest, std::min(count, utf8_count(string->buffer + at, rest)),
                      out_bytes);
 }
+
+} // namespace
 
 // --- Life
 
@@ -158,7 +162,10 @@ lc_status ts_new_sprintf(tstring **out, const char *format, ...) {
     CHECK_STATUS(ts_new_str(out, text.pointer));
     return LC_OK;
 }
-static lc_status takeover(tstring **out, char **inout_text, int32_t length, int32_t size, bool utf8) {
+
+namespace {
+
+lc_status takeover(tstring **out, char **inout_text, int32_t length, int32_t size, bool utf8) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(inout_text);
@@ -187,6 +194,9 @@ static lc_status takeover(tstring **out, char **inout_text, int32_t length, int3
     *out = guard.take();
     return LC_OK;
 }
+
+} // namespace
+
 lc_status ts_new_str_takeover(tstring **out, char **inout_text, int32_t length, int32_t size) {
     return takeover(out, inout_text, length, size, false);
 }
@@ -264,10 +274,15 @@ lc_status ts_dup_str(const tstring *string, char **out_text, int32_t *out_length
 
 // --- Reading
 
-static const char *base_name(const char *file) {
+namespace {
+
+const char *base_name(const char *file) {
     const char *slash = file ? strrchr(file, '/') : nullptr;
     return slash ? slash + 1 : file;
 }
+
+} // namespace
+
 int32_t ts_length_(const tstring *string, const char *, int32_t) {
     return string ? string->length : -1;
 }
@@ -301,10 +316,16 @@ lc_status ts_substr(const tstring *string, int32_t start, int32_t count, tstring
     *out = piece.take();
     return LC_OK;
 }
-static int32_t characters_before(const tstring *string, const char *place) {
+
+namespace {
+
+int32_t characters_before(const tstring *string, const char *place) {
     const auto bytes = static_cast<int32_t>(place - string->buffer);
     return string->utf8 ? utf8_count(string->buffer, bytes) : bytes;
 }
+
+} // namespace
+
 lc_status ts_find_char(const tstring *string, int32_t start, char byte, int32_t *out_offset) {
     CHECK_NULL(out_offset);
     *out_offset = -1;
@@ -360,8 +381,10 @@ lc_status ts_insert_char(tstring *string, int32_t offset, char byte) {
     return LC_OK;
 }
 
+namespace {
+
 // Replaces as many characters as `text` has, or with `to_end` everything from the offset on.
-static lc_status write_text(tstring *string, int32_t offset, const char *text, size_t length, bool to_end) {
+lc_status write_text(tstring *string, int32_t offset, const char *text, size_t length, bool to_end) {
     CHECK_CONDITION(length <= ts_size_max);
     const auto bytes = static_cast<int32_t>(length);
     int32_t at = 0, removed = 0;
@@ -375,6 +398,9 @@ static lc_status write_text(tstring *string, int32_t offset, const char *text, s
     CHECK_STATUS(splice(string, at, removed, text, bytes));
     return LC_OK;
 }
+
+} // namespace
+
 lc_status ts_put_str(tstring *string, int32_t offset, const char *text) {
     CHECK_NULL(string);
     CHECK_NULL(text);
@@ -405,8 +431,10 @@ lc_status ts_append_sprintf(tstring *string, const char *format, ...) {
     return ts_append_str(string, text.pointer);
 }
 
-static lc_status put_fragment(tstring *string, int32_t offset, const char *text, int32_t start, int32_t count,
-                              bool by_characters) {
+namespace {
+
+lc_status put_fragment(tstring *string, int32_t offset, const char *text, int32_t start, int32_t count,
+                       bool by_characters) {
     CHECK_NULL(string);
     CHECK_NULL(text);
     CHECK_CONDITION(start >= 0 && count >= -1);
@@ -429,6 +457,9 @@ static lc_status put_fragment(tstring *string, int32_t offset, const char *text,
     }
     return write_text(string, offset, text + first, length, false);
 }
+
+} // namespace
+
 lc_status ts_put_str_frag(tstring *string, int32_t offset, const char *text, int32_t start, int32_t count) {
     return put_fragment(string, offset, text, start, count, false);
 }

@@ -24,14 +24,12 @@ struct token_syntax {
     bool escapable(char next) const { return next && (next == separator || next == escape || next == quote); }
 };
 
-} // namespace
-
-static bool is_bad(const token_syntax &syntax) {
+bool is_bad(const token_syntax &syntax) {
     return !syntax.separator || syntax.separator == syntax.escape || syntax.separator == syntax.quote ||
            (syntax.escape && syntax.escape == syntax.quote);
 }
 
-static lc_status add_token(const token_syntax &syntax, tstr_array *tokens, const char *bytes, size_t length) {
+lc_status add_token(const token_syntax &syntax, tstr_array *tokens, const char *bytes, size_t length) {
     if (length == 0 && !(syntax.flags & ts_tok_keep_empty))
         return LC_OK;
     owned<tstring, ts_release> token;
@@ -45,7 +43,7 @@ static lc_status add_token(const token_syntax &syntax, tstr_array *tokens, const
     return LC_OK;
 }
 
-static lc_status scan(const token_syntax &syntax, const char *text, tstr_array *tokens) {
+lc_status scan(const token_syntax &syntax, const char *text, tstr_array *tokens) {
     const size_t size = strlen(text);
     if (size >= ts_size_max) // a token could be longer than a string can be
         FAIL_WITH(LC_ASSERTION);
@@ -81,7 +79,7 @@ static lc_status scan(const token_syntax &syntax, const char *text, tstr_array *
     return LC_OK;
 }
 
-static lc_status tokenize(token_syntax syntax, const char *text, tstr_array **out) {
+lc_status tokenize(token_syntax syntax, const char *text, tstr_array **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(text);
@@ -103,6 +101,9 @@ static lc_status tokenize(token_syntax syntax, const char *text, tstr_array **ou
         *out = tokens.take();
     return LC_OK;
 }
+
+} // namespace
+
 lc_status ts_tokenize_str(const char *text, char separator, char escape, char quote, uint32_t flags,
                           tstr_array **out) {
     return tokenize({separator, escape, quote, flags, false}, text, out);
@@ -112,8 +113,10 @@ lc_status ts_tokenize_str_utf8(const char *text, char separator, char escape, ch
     return tokenize({separator, escape, quote, flags, true}, text, out);
 }
 
+namespace {
+
 // ts_append_char without its checks, while the presized buffer lasts.
-static lc_status push(tstring *string, char c) {
+lc_status push(tstring *string, char c) {
     if (static_cast<uint32_t>(string->length) + 2 > string->size)
         return ts_append_char(string, c);
     string->buffer[string->length++] = c;
@@ -123,7 +126,7 @@ static lc_status push(tstring *string, char c) {
 }
 
 // `separated`: a separator follows the token, so an escape at its end has to be doubled.
-static lc_status write_token(const token_syntax &syntax, const tstring *token, bool separated, tstring *out) {
+lc_status write_token(const token_syntax &syntax, const tstring *token, bool separated, tstring *out) {
     for (const char *at = token->buffer; *at; at++) {
         const char c = *at;
         const char next = at[1] || !separated ? at[1] : syntax.separator;
@@ -136,7 +139,7 @@ static lc_status write_token(const token_syntax &syntax, const tstring *token, b
     return LC_OK;
 }
 
-static lc_status write_tokens(const token_syntax &syntax, const tstr_array *array, tstring *out) {
+lc_status write_tokens(const token_syntax &syntax, const tstr_array *array, tstring *out) {
     const uint32_t count = tstr_array_length_quick(array);
     bool first = true;
     for (uint32_t i = 0; i < count; i++) {
@@ -152,7 +155,7 @@ static lc_status write_tokens(const token_syntax &syntax, const tstr_array *arra
     return LC_OK;
 }
 
-static lc_status join(const token_syntax &syntax, const tstr_array *array, tstring **out) {
+lc_status join(const token_syntax &syntax, const tstr_array *array, tstring **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(array);
@@ -178,6 +181,9 @@ static lc_status join(const token_syntax &syntax, const tstr_array *array, tstri
     *out = string.take();
     return LC_OK;
 }
+
+} // namespace
+
 lc_status ts_join_tokens(const tstr_array *array, char separator, char escape, char quote, uint32_t flags,
                          tstring **out) {
     return join({separator, escape, quote, flags, false}, array, out);

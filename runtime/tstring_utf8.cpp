@@ -10,8 +10,10 @@
 #include "runtime/logging.h"
 #include "runtime/tstring.h"
 
+namespace {
+
 // The length of the sequence that this lead byte begins; 0 for a continuation byte.
-static int32_t sequence_length(uint8_t lead) {
+int32_t sequence_length(uint8_t lead) {
     if (lead < 0x80)
         return 1;
     if (lead < 0xc0 || lead > 0xfd)
@@ -19,7 +21,7 @@ static int32_t sequence_length(uint8_t lead) {
     return lead < 0xe0 ? 2 : lead < 0xf0 ? 3 : lead < 0xf8 ? 4 : lead < 0xfc ? 5 : 6;
 }
 
-static int32_t character_length(const char *text, int32_t bytes) {
+int32_t character_length(const char *text, int32_t bytes) {
     const int32_t length = bytes > 0 ? sequence_length(static_cast<uint8_t>(text[0])) : 0;
     if (length > bytes)
         return 0;
@@ -29,7 +31,7 @@ static int32_t character_length(const char *text, int32_t bytes) {
     return length;
 }
 
-static void tell_bytes(const char *text, int32_t bytes) {
+void tell_bytes(const char *text, int32_t bytes) {
     owned<tstring, ts_release> list;
     if (!lc_log_check_level(LC_LOG_WARNING) || ts_new(&list.pointer) != LC_OK)
         return;
@@ -44,6 +46,8 @@ static void tell_bytes(const char *text, int32_t bytes) {
     LC_LOG(LC_LOG_WARNING, "%s", ts_str(list.pointer));
 }
 
+} // namespace
+
 int32_t utf8_count(const char *text, int32_t bytes) {
     int32_t count = 0;
     for (int32_t i = 0; i < bytes; i++)
@@ -51,7 +55,9 @@ int32_t utf8_count(const char *text, int32_t bytes) {
     return count;
 }
 
-static lc_status walk(const char *text, int32_t bytes, int32_t characters, int32_t *out_bytes) {
+namespace {
+
+lc_status walk(const char *text, int32_t bytes, int32_t characters, int32_t *out_bytes) {
     int32_t at = 0;
     for (int32_t i = 0; characters < 0 ? at < bytes : i < characters; i++) {
         const int32_t length = character_length(text + at, bytes - at);
@@ -64,6 +70,9 @@ static lc_status walk(const char *text, int32_t bytes, int32_t characters, int32
     *out_bytes = at;
     return LC_OK;
 }
+
+} // namespace
+
 lc_status utf8_check(const char *text, int32_t bytes) {
     int32_t end = 0;
     return walk(text, bytes, -1, &end);
@@ -82,14 +91,18 @@ uint32_t utf8_decode(const char *text, int32_t bytes) {
     return value;
 }
 
-static locale_t utf8_locale;
-static pthread_once_t utf8_locale_once = PTHREAD_ONCE_INIT;
+namespace {
 
-static uint32_t folded(uint32_t character) {
+locale_t utf8_locale;
+pthread_once_t utf8_locale_once = PTHREAD_ONCE_INIT;
+
+uint32_t folded(uint32_t character) {
     pthread_once(&utf8_locale_once,
                  [] { utf8_locale = newlocale(LC_CTYPE_MASK, "C.UTF-8", static_cast<locale_t>(nullptr)); });
     return utf8_locale ? towlower_l(character, utf8_locale) : towlower(character);
 }
+
+} // namespace
 
 int utf8_equal_ignoring_case(const char *a, const char *b) {
     while (*a && *b) {

@@ -93,8 +93,10 @@ lt_time_ms lt_timeval_to_time_ms(const timeval *value) {
 
 // --- To text
 
-static lc_status format_time(char *buffer, uint32_t size, size_t at, const char *format, const tm *parts,
-                             size_t *out_end) {
+namespace {
+
+lc_status format_time(char *buffer, uint32_t size, size_t at, const char *format, const tm *parts,
+                      size_t *out_end) {
     CHECK_CONDITION(at < size);
     const size_t written = strftime(buffer + at, size - at, format, parts);
     CHECK_CONDITION(written > 0);
@@ -103,7 +105,7 @@ static lc_status format_time(char *buffer, uint32_t size, size_t at, const char 
 }
 
 // Appends the fraction of a second as ".250" or ".250125", if there is one and the buffer has room for it.
-static void append_fraction(char *buffer, uint32_t size, size_t *at, int64_t value) {
+void append_fraction(char *buffer, uint32_t size, size_t *at, int64_t value) {
     // Also of a negative value the fraction counts forward from the whole second before it.
     const int64_t fraction = ((value % US_PER_SEC) + US_PER_SEC) % US_PER_SEC;
     if (fraction == 0 || *at + 9 > size)
@@ -116,12 +118,11 @@ static void append_fraction(char *buffer, uint32_t size, size_t *at, int64_t val
 }
 
 // Rounds down, also for negative values.
-static int64_t whole_seconds(int64_t us) {
+int64_t whole_seconds(int64_t us) {
     return us / US_PER_SEC - (us % US_PER_SEC < 0);
 }
 
-static lc_status to_text(int64_t us, bool local, const char *format, bool with_zone, uint32_t size,
-                         char *buffer) {
+lc_status to_text(int64_t us, bool local, const char *format, bool with_zone, uint32_t size, char *buffer) {
     CHECK_NULL(buffer);
     const time_t seconds = whole_seconds(us);
     tm parts{};
@@ -133,6 +134,8 @@ static lc_status to_text(int64_t us, bool local, const char *format, bool with_z
         CHECK_STATUS(format_time(buffer, size, at, " %z", &parts, &at));
     return LC_OK;
 }
+
+} // namespace
 
 lc_status lt_date_to_buf(lt_date value, uint32_t size, char *buffer, uint32_t *out_length) {
     CHECK_NULL(buffer);
@@ -159,11 +162,16 @@ lc_status lt_dur_us_to_buf(lt_dur_us value, uint32_t size, char *buffer) {
     return LC_OK;
 }
 
+namespace {
+
 // To microseconds. LC_ASSERTION on overflow.
-static lc_status scaled(int64_t value, int64_t factor, int64_t *out) {
+lc_status scaled(int64_t value, int64_t factor, int64_t *out) {
     CHECK_CONDITION(!__builtin_mul_overflow(value, factor, out));
     return LC_OK;
 }
+
+} // namespace
+
 // Defines lt_daytime_sec_to_buf for example, by way of lt_daytime_us_to_buf. `parameters` and `arguments` are
 // what the functions of a kind take besides the value, in parentheses.
 #define LT_COARSER(kind, unit, type, factor, parameters, arguments)                                          \
@@ -180,8 +188,10 @@ LT_COARSER(datetime, ms, lt_time_ms, US_PER_MS, (int with_zone), (with_zone))
 LT_COARSER(dur, sec, lt_dur_sec, US_PER_SEC, (), ())
 LT_COARSER(dur, ms, lt_dur_ms, US_PER_MS, (), ())
 
+namespace {
+
 template <typename Write>
-static lc_status to_str(char **out, Write write) {
+lc_status to_str(char **out, Write write) {
     CHECK_NULL(out);
     *out = nullptr;
     auto *text = static_cast<char *>(malloc(TEXT_SIZE));
@@ -193,6 +203,9 @@ static lc_status to_str(char **out, Write write) {
     *out = text;
     return LC_OK;
 }
+
+} // namespace
+
 lc_status lt_date_to_str(lt_date value, char **out) {
     return to_str(out, [&](char *text) { return lt_date_to_buf(value, TEXT_SIZE, text, nullptr); });
 }
@@ -215,15 +228,17 @@ LT_TO_STR(dur_us, lt_dur_us, (), ())
 
 // --- From text
 
+namespace {
+
 // Truncates to microseconds. Most decimal fractions have no exact representation as a double, so 0.000249
 // would become 248 microseconds; the correction is far below a microsecond, and makes every text that
 // lt_..._to_str writes read back as the same value.
-static int64_t truncated_us(double seconds) {
+int64_t truncated_us(double seconds) {
     const double us = seconds * static_cast<double>(US_PER_SEC);
     return static_cast<int64_t>(us + us * 1e-15);
 }
 
-static lc_status fraction_from_text(const char *text, int64_t *out_us) {
+lc_status fraction_from_text(const char *text, int64_t *out_us) {
     double fraction = 0;
     if (*text == 0)
         return LC_OK;
@@ -233,7 +248,7 @@ static lc_status fraction_from_text(const char *text, int64_t *out_us) {
     return LC_OK;
 }
 
-static lc_status from_text(const char *text, bool local, lt_time_us *out) {
+lc_status from_text(const char *text, bool local, lt_time_us *out) {
     CHECK_NULL(out);
     *out = 0;
     CHECK_NULL(text);
@@ -252,6 +267,8 @@ static lc_status from_text(const char *text, bool local, lt_time_us *out) {
     *out = int64_t{seconds} * US_PER_SEC + fraction;
     return LC_OK;
 }
+
+} // namespace
 
 lc_status lt_str_to_date(const char *text, lt_date *out) {
     CHECK_NULL(out);
@@ -294,16 +311,21 @@ lc_status lt_str_to_dur_us(const char *text, lt_dur_us *out) {
     return LC_OK;
 }
 
-static lc_status to_ms(lt_time_us us, int64_t *out) {
+namespace {
+
+lc_status to_ms(lt_time_us us, int64_t *out) {
     CHECK_CONDITION(us >= 0);
     *out = us / US_PER_MS;
     return LC_OK;
 }
-static lc_status to_sec(lt_time_us us, int32_t *out) {
+lc_status to_sec(lt_time_us us, int32_t *out) {
     CHECK_CONDITION(us >= 0 && us < SEC_LIMIT_US);
     *out = static_cast<int32_t>(us / US_PER_SEC);
     return LC_OK;
 }
+
+} // namespace
+
 // Defines lt_str_to_daytime_ms for example, by way of lt_str_to_daytime_us.
 #define LT_FROM_STR(kind, unit, type)                                                                        \
     lc_status lt_str_to_##kind##_##unit(const char *text, type *out) {                                       \
