@@ -185,7 +185,7 @@ lc_status bn_binding_new_str_autoinval(bn_binding **out, const char *name, uint3
 
 namespace {
 
-lc_status reach(const bn_binding *binding, uint32_t id, const bn_attrib **out) {
+lc_status find_attribute_or_log(const bn_binding *binding, uint32_t id, const bn_attrib **out) {
     bn_attrib *attrib = nullptr;
     const lc_status status =
         binding->attributes ? bn_attrib_array_get(binding->attributes, id, &attrib) : LC_NULL;
@@ -210,7 +210,7 @@ lc_status bn_binding_get_str(const bn_binding *binding, uint32_t id, uint32_t ex
         *out_type_and_flags = 0;
     CHECK_NULL(binding);
     const bn_attrib *attrib = nullptr;
-    CHECK_QUIET(reach(binding, id, &attrib));
+    CHECK_QUIET(find_attribute_or_log(binding, id, &attrib));
     if (attrib)
         CHECK_STATUS(bn_attrib_get_str(attrib, nullptr, expected_type, out_type_and_flags, out_text));
     return LC_OK;

@@ -9,16 +9,6 @@
 #include "mgmt/bnode_rows.h"
 #include "mgmt/bnode_types.h"
 
-namespace {
-
-lc_status text_given(char *text, char **out) {
-    CHECK_NULL(text);
-    *out = text;
-    return LC_OK;
-}
-
-} // namespace
-
 // --- IPv4 and IPv6
 
 lc_status bn_text_to_ipaddr(const char *text, lc_ipaddr *out) {
@@ -63,7 +53,7 @@ lc_status lc_str_to_ipprefix(const char *text, lc_ipprefix *out) {
 
 namespace {
 
-lc_status address_text(uint8_t family, const uint8_t *address, char *text, socklen_t size) {
+lc_status write_address_text(uint8_t family, const uint8_t *address, char *text, socklen_t size) {
     CHECK_NULL(inet_ntop(family == 6 ? AF_INET6 : AF_INET, address, text, size));
     return LC_OK;
 }
@@ -75,16 +65,16 @@ lc_status lc_ipaddr_to_str(const lc_ipaddr *value, char **out) {
     *out = nullptr;
     CHECK_NULL(value);
     char text[INET6_ADDRSTRLEN];
-    CHECK_STATUS(address_text(value->family, value->address, text, sizeof text));
-    return text_given(safe_strdup(text), out);
+    CHECK_STATUS(write_address_text(value->family, value->address, text, sizeof text));
+    return bn_give_text(safe_strdup(text), out);
 }
 lc_status lc_ipprefix_to_str(const lc_ipprefix *value, char **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(value);
     char text[INET6_ADDRSTRLEN];
-    CHECK_STATUS(address_text(value->family, value->address, text, sizeof text));
-    return text_given(smprintf("%s/%u", text, value->mask_length), out);
+    CHECK_STATUS(write_address_text(value->family, value->address, text, sizeof text));
+    return bn_give_text(smprintf("%s/%u", text, value->mask_length), out);
 }
 int lc_ipaddr_compare(const lc_ipaddr *a, const lc_ipaddr *b) {
     if (a->family != b->family)
@@ -153,16 +143,16 @@ lc_status lc_str_to_ipv4prefix(const char *text, uint64_t *out) {
 }
 lc_status lc_ipv4addr_to_str(uint32_t value, char **out) {
     CHECK_NULL(out);
-    return text_given(
+    return bn_give_text(
         smprintf("%u.%u.%u.%u", value >> 24, (value >> 16) & 255, (value >> 8) & 255, value & 255), out);
 }
 lc_status lc_ipv4prefix_to_str(uint64_t value, char **out) {
     CHECK_NULL(out);
     const auto address = static_cast<uint32_t>(value >> 32);
     const auto mask = static_cast<uint32_t>(value);
-    return text_given(smprintf("%u.%u.%u.%u/%d", address >> 24, (address >> 16) & 255, (address >> 8) & 255,
-                               address & 255, std::countl_one(mask)),
-                      out);
+    return bn_give_text(smprintf("%u.%u.%u.%u/%d", address >> 24, (address >> 16) & 255, (address >> 8) & 255,
+                                 address & 255, std::countl_one(mask)),
+                        out);
 }
 
 // --- Hardware addresses
@@ -201,5 +191,5 @@ lc_status lc_macaddr802_to_str(const lc_macaddr802 *value, char **out) {
     *out = nullptr;
     CHECK_NULL(value);
     const uint8_t *b = value->bytes;
-    return text_given(smprintf("%02X:%02X:%02X:%02X:%02X:%02X", b[0], b[1], b[2], b[3], b[4], b[5]), out);
+    return bn_give_text(smprintf("%02X:%02X:%02X:%02X:%02X:%02X", b[0], b[1], b[2], b[3], b[4], b[5]), out);
 }

@@ -236,6 +236,7 @@ lc_status bn_binding_array_get_first_matching_value_tstr(const bn_binding_array 
         *out_value = nullptr;
     const bn_binding *binding = nullptr;
     CHECK_STATUS(bn_binding_array_get_first_matching_binding(array, pattern, start, out_index, &binding));
+    // Copies are made before any out is set, so that a failure leaves all of them null.
     owned<tstring, ts_release> name, value;
     if (binding && out_name)
         CHECK_STATUS(ts_dup(binding->name, &name.pointer));

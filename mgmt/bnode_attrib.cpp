@@ -92,7 +92,7 @@ lc_status bn_attrib_get_type(const bn_attrib *attrib, uint32_t *out_type, uint32
 
 namespace {
 
-int compare(const bn_attrib *a, const bn_attrib *b) {
+int compare_attributes(const bn_attrib *a, const bn_attrib *b) {
     if (!a || !b)
         return (a ? 0 : 1) - (b ? 0 : 1);
     const bool a_invalid = a->type_flags & bn_flag_invalid, b_invalid = b->type_flags & bn_flag_invalid;
@@ -108,7 +108,7 @@ int compare(const bn_attrib *a, const bn_attrib *b) {
 
 lc_status bn_attrib_compare(const bn_attrib *a, const bn_attrib *b, int *out_result) {
     CHECK_NULL(out_result);
-    *out_result = compare(a, b);
+    *out_result = compare_attributes(a, b);
     return LC_OK;
 }
 
@@ -117,7 +117,7 @@ lc_status bn_attrib_compare(const bn_attrib *a, const bn_attrib *b, int *out_res
 namespace {
 
 // Frees the old value and sets everything but the new one.
-void begin(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags) {
+void reset_attribute(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flags) {
     (void)bn_attrib_free_value(attrib);
     attrib->attribute_id = id;
     attrib->type = type;
@@ -129,7 +129,7 @@ lc_status set_fixed(bn_attrib *attrib, uint32_t id, uint32_t type, uint32_t flag
     CHECK_NULL(value);
     CHECK_CONDITION(bn_attrib_id_valid(id));
     CHECK_CONDITION(bn_type_find(type) && bn_type_find(type)->size == size);
-    begin(attrib, id, type, flags);
+    reset_attribute(attrib, id, type, flags);
     memcpy(attrib->value.bytes, value, size);
     attrib->value_size = size;
     return LC_OK;
@@ -146,7 +146,7 @@ lc_status bn_attrib_set_str(bn_attrib *attrib, uint32_t id, uint32_t type, uint3
     CHECK_CONDITION(row && type <= BN_TYPE_LAST);
     // The absent mark leaves the size at 0; for the invalid mark it is the type's.
     if ((flags & bn_flag_no_value) || type == bn_type_none) {
-        begin(attrib, id, type, flags);
+        reset_attribute(attrib, id, type, flags);
         if (!(flags & bn_flag_absent))
             attrib->value_size = row->size;
         return LC_OK;
@@ -185,7 +185,7 @@ lc_status bn_attrib_new_str(bn_attrib **out, uint32_t id, uint32_t type, uint32_
 
 namespace {
 
-void tell(const bn_attrib *attrib, uint32_t *out_id, uint32_t *out_type_and_flags) {
+void get_id_and_type(const bn_attrib *attrib, uint32_t *out_id, uint32_t *out_type_and_flags) {
     if (out_id)
         *out_id = attrib->attribute_id;
     if (out_type_and_flags)
@@ -199,7 +199,7 @@ lc_status bn_attrib_get_str(const bn_attrib *attrib, uint32_t *out_id, uint32_t 
     CHECK_NULL(out_text);
     *out_text = nullptr;
     CHECK_NULL(attrib);
-    tell(attrib, out_id, out_type_and_flags);
+    get_id_and_type(attrib, out_id, out_type_and_flags);
     if (expected_type && expected_type != attrib->type)
         return LC_ASSERTION;
     if (attrib->type_flags & bn_flag_no_value) {
@@ -218,7 +218,7 @@ lc_status bn_attrib_get_tstring_const(const bn_attrib *attrib, uint32_t *out_id,
     *out = nullptr;
     CHECK_NULL(attrib);
     CHECK_CONDITION(owns_text(attrib));
-    tell(attrib, out_id, out_type_and_flags);
+    get_id_and_type(attrib, out_id, out_type_and_flags);
     *out = attrib->value.string;
     return LC_OK;
 }
@@ -228,7 +228,7 @@ lc_status bn_attrib_get_tbuf_const(const bn_attrib *attrib, uint32_t *out_id, ui
     *out = nullptr;
     CHECK_NULL(attrib);
     CHECK_CONDITION(owns_binary(attrib));
-    tell(attrib, out_id, out_type_and_flags);
+    get_id_and_type(attrib, out_id, out_type_and_flags);
     *out = attrib->value.binary;
     return LC_OK;
 }
@@ -246,13 +246,13 @@ lc_status read_fixed(const bn_attrib *attrib, uint32_t type, uint32_t *out_id, u
                lc_enum_to_string_quiet(bn_type_table, static_cast<int32_t>(type)));
         return LC_ASSERTION;
     }
-    tell(attrib, out_id, out_type_and_flags);
+    get_id_and_type(attrib, out_id, out_type_and_flags);
     memcpy(value, attrib->value.bytes, size);
     return LC_OK;
 }
 
 // The attribute in a slot of a binding; null if the slot is empty.
-lc_status slot_of(const bn_binding *binding, uint32_t id, uint32_t *out_type_and_flags, bn_attrib **out) {
+lc_status find_slot(const bn_binding *binding, uint32_t id, uint32_t *out_type_and_flags, bn_attrib **out) {
     *out = nullptr;
     if (out_type_and_flags)
         *out_type_and_flags = 0;
@@ -263,8 +263,8 @@ lc_status slot_of(const bn_binding *binding, uint32_t id, uint32_t *out_type_and
     CHECK_STATUS(bn_attrib_array_get(binding->attributes, id, out));
     return LC_OK;
 }
-lc_status make_fixed(bn_attrib **out, uint32_t id, uint32_t type, uint32_t flags, const void *value,
-                     uint32_t size) {
+lc_status new_fixed(bn_attrib **out, uint32_t id, uint32_t type, uint32_t flags, const void *value,
+                    uint32_t size) {
     CHECK_NULL(out);
     *out = nullptr;
     owned<bn_attrib, bn_release_attrib> attrib;
@@ -273,20 +273,20 @@ lc_status make_fixed(bn_attrib **out, uint32_t id, uint32_t type, uint32_t flags
     *out = attrib.take();
     return LC_OK;
 }
-lc_status put_fixed(bn_binding *binding, uint32_t id, uint32_t type, uint32_t flags, const void *value,
-                    uint32_t size) {
+lc_status set_binding_fixed(bn_binding *binding, uint32_t id, uint32_t type, uint32_t flags,
+                            const void *value, uint32_t size) {
     owned<bn_attrib, bn_release_attrib> attrib;
-    CHECK_STATUS(make_fixed(&attrib.pointer, id, type, flags, value, size));
+    CHECK_STATUS(new_fixed(&attrib.pointer, id, type, flags, value, size));
     CHECK_STATUS(bn_binding_set_attrib_takeover(binding, &attrib.pointer));
     return LC_OK;
 }
-lc_status name_fixed(bn_binding **out, const char *name, uint32_t id, uint32_t type, uint32_t flags,
-                     const void *value, uint32_t size) {
+lc_status new_binding_fixed(bn_binding **out, const char *name, uint32_t id, uint32_t type, uint32_t flags,
+                            const void *value, uint32_t size) {
     CHECK_NULL(out);
     *out = nullptr;
     owned<bn_binding, bn_release_binding> binding;
     CHECK_STATUS(bn_binding_new_named(&binding.pointer, name));
-    CHECK_STATUS(put_fixed(binding.pointer, id, type, flags, value, size));
+    CHECK_STATUS(set_binding_fixed(binding.pointer, id, type, flags, value, size));
     *out = binding.take();
     return LC_OK;
 }
@@ -323,7 +323,7 @@ const Value *bn_at(const Value &value) {
         return set_fixed(attrib, id, number, flags, in_place, sizeof(type));                                 \
     }                                                                                                        \
     lc_status bn_attrib_new_##name(bn_attrib **out, uint32_t id, uint32_t flags, BN_UNPAREN in) {            \
-        return make_fixed(out, id, number, flags, in_place, sizeof(type));                                   \
+        return new_fixed(out, id, number, flags, in_place, sizeof(type));                                    \
     }                                                                                                        \
     lc_status bn_attrib_get_##name(const bn_attrib *attrib, uint32_t *out_id, uint32_t *out_type_and_flags,  \
                                    BN_UNPAREN outs) {                                                        \
@@ -333,16 +333,16 @@ const Value *bn_at(const Value &value) {
         return LC_OK;                                                                                        \
     }                                                                                                        \
     lc_status bn_binding_set_##name(bn_binding *binding, uint32_t id, uint32_t flags, BN_UNPAREN in) {       \
-        return put_fixed(binding, id, number, flags, in_place, sizeof(type));                                \
+        return set_binding_fixed(binding, id, number, flags, in_place, sizeof(type));                        \
     }                                                                                                        \
     lc_status bn_binding_new_##name(bn_binding **out, const char *name_text, uint32_t id, uint32_t flags,    \
                                     BN_UNPAREN in) {                                                         \
-        return name_fixed(out, name_text, id, number, flags, in_place, sizeof(type));                        \
+        return new_binding_fixed(out, name_text, id, number, flags, in_place, sizeof(type));                 \
     }                                                                                                        \
     lc_status bn_binding_get_##name(const bn_binding *binding, uint32_t id, uint32_t *out_type_and_flags,    \
                                     BN_UNPAREN outs) {                                                       \
         bn_attrib *attrib = nullptr;                                                                         \
-        CHECK_QUIET(slot_of(binding, id, out_type_and_flags, &attrib));                                      \
+        CHECK_QUIET(find_slot(binding, id, out_type_and_flags, &attrib));                                    \
         if (!attrib)                                                                                         \
             return LC_OK;                                                                                    \
         type stored{};                                                                                       \

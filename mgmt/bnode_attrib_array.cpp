@@ -11,17 +11,17 @@
 namespace {
 
 // The index of the first filled slot whose id is not less than `id`.
-uint32_t place_of(const bn_attrib_array *array, uint32_t id) {
+uint32_t find_slot_index(const bn_attrib_array *array, uint32_t id) {
     uint32_t at = 0;
     while (at < array->count && array->slots[at].id < id)
         at++;
     return at;
 }
-bn_attrib *attrib_at(const bn_attrib_array *array, uint32_t id) {
-    const uint32_t at = place_of(array, id);
+bn_attrib *find_attrib(const bn_attrib_array *array, uint32_t id) {
+    const uint32_t at = find_slot_index(array, id);
     return at < array->count && array->slots[at].id == id ? array->slots[at].attrib : nullptr;
 }
-void free_slot(bn_attrib_slot *slot) {
+void free_attrib_slot(bn_attrib_slot *slot) {
     if (slot->placed)
         (void)bn_attrib_free_value(slot->attrib);
     else
@@ -46,7 +46,7 @@ lc_status bn_attrib_array_free(bn_attrib_array **inout) {
     if (!array)
         return LC_OK;
     for (uint32_t i = 0; i < array->count; i++)
-        free_slot(&array->slots[i]);
+        free_attrib_slot(&array->slots[i]);
     if (!array->placed_slots)
         free(array->slots);
     if (!array->placed_record)
@@ -59,7 +59,7 @@ void bn_attrib_array_release(bn_attrib_array *array) {
 
 namespace {
 
-lc_status make_room(bn_attrib_array *array, uint32_t count) {
+lc_status reserve_attrib_slots(bn_attrib_array *array, uint32_t count) {
     if (count <= array->capacity)
         return LC_OK;
     const uint32_t capacity = std::max(count, array->capacity * 2);
@@ -82,7 +82,7 @@ lc_status bn_attrib_array_duplicate(const bn_attrib_array *array, bn_attrib_arra
     CHECK_NULL(array);
     owned<bn_attrib_array, bn_attrib_array_release> copy;
     CHECK_STATUS(bn_attrib_array_new(&copy.pointer));
-    CHECK_STATUS(make_room(copy.pointer, array->count));
+    CHECK_STATUS(reserve_attrib_slots(copy.pointer, array->count));
     for (uint32_t i = 0; i < array->count; i++) {
         bn_attrib *attrib = nullptr;
         CHECK_STATUS(bn_attrib_dup(array->slots[i].attrib, &attrib));
@@ -97,7 +97,7 @@ uint32_t bn_attrib_array_length_quick(const bn_attrib_array *array) {
     return array ? array->length : 0;
 }
 bn_attrib *bn_attrib_array_get_quick(const bn_attrib_array *array, uint32_t id) {
-    return array ? attrib_at(array, id) : nullptr;
+    return array ? find_attrib(array, id) : nullptr;
 }
 lc_status bn_attrib_array_get(const bn_attrib_array *array, uint32_t id, bn_attrib **out) {
     CHECK_NULL(out);
@@ -105,27 +105,28 @@ lc_status bn_attrib_array_get(const bn_attrib_array *array, uint32_t id, bn_attr
     CHECK_NULL(array);
     if (id >= array->length)
         return LC_NOT_FOUND;
-    *out = attrib_at(array, id);
+    *out = find_attrib(array, id);
     return LC_OK;
 }
 
 namespace {
 
-lc_status put(bn_attrib_array *array, uint32_t id, bn_attrib *attrib, bool placed) {
+lc_status fill_slot(bn_attrib_array *array, uint32_t id, bn_attrib *attrib, bool placed) {
     CHECK_CONDITION(id <= array_size_max);
-    const uint32_t at = place_of(array, id);
+    const uint32_t at = find_slot_index(array, id);
     const bool filled = at < array->count && array->slots[at].id == id;
     bn_attrib_slot *end = array->slots + array->count;
     // The same object again: freeing the old one would free it.
     if (filled && array->slots[at].attrib == attrib)
         return LC_OK;
     if (filled)
-        free_slot(&array->slots[at]);
+        free_attrib_slot(&array->slots[at]);
+    // A null empties the slot; the length stays, as in any array.
     if (filled && !attrib) {
         std::copy(array->slots + at + 1, end, array->slots + at);
         array->count--;
     } else if (attrib && !filled) {
-        CHECK_STATUS(make_room(array, array->count + 1));
+        CHECK_STATUS(reserve_attrib_slots(array, array->count + 1));
         end = array->slots + array->count++;
         std::copy_backward(array->slots + at, end, end + 1);
     }
@@ -140,7 +141,7 @@ lc_status put(bn_attrib_array *array, uint32_t id, bn_attrib *attrib, bool place
 lc_status bn_attrib_array_set_takeover(bn_attrib_array *array, uint32_t id, bn_attrib **inout) {
     CHECK_NULL(array);
     CHECK_NULL(inout);
-    CHECK_QUIET(put(array, id, *inout, false));
+    CHECK_QUIET(fill_slot(array, id, *inout, false));
     *inout = nullptr;
     return LC_OK;
 }
@@ -152,5 +153,5 @@ lc_status bn_attrib_array_set(bn_attrib_array *array, uint32_t id, const bn_attr
     return bn_attrib_array_set_takeover(array, id, &copy.pointer);
 }
 lc_status bn_attrib_array_put_placed(bn_attrib_array *array, uint32_t id, bn_attrib *attrib) {
-    return put(array, id, attrib, true);
+    return fill_slot(array, id, attrib, true);
 }

@@ -38,7 +38,7 @@ bool has_value(uint32_t flags) {
 
 // Converts between stored bytes (little-endian) and wire bytes by reversing them. The mask length that
 // follows the address in an ipv6prefix stays in its place.
-void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
+void reverse_value(const uint8_t *from, uint8_t *to, uint32_t size) {
     static_assert(std::endian::native == std::endian::little);
     const uint32_t turned = std::min(size, ADDRESS_SIZE);
     std::reverse_copy(from, from + turned, to);
@@ -47,12 +47,12 @@ void turn(const uint8_t *from, uint8_t *to, uint32_t size) {
 
 // --- Writing
 
-lc_status put_number(tbuffer *buffer, uint32_t offset, uint32_t value) {
+lc_status put_be32(tbuffer *buffer, uint32_t offset, uint32_t value) {
     return tb_put_uint32(buffer, offset, raw_word(to_be32(value)));
 }
 // This and put_value write to the buffer and return the number of bytes written in `out`.
 lc_status put_sized(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_t size, uint32_t *out) {
-    CHECK_STATUS(put_number(buffer, offset, size));
+    CHECK_STATUS(put_be32(buffer, offset, size));
     CHECK_STATUS(tb_put_buf(buffer, offset + 4, bytes, size));
     *out = 4 + size;
     return LC_OK;
@@ -71,14 +71,15 @@ lc_status put_value(const bn_type_row *row, const bn_attrib *attrib, tbuffer *bu
     uint8_t bytes[sizeof attrib->value.bytes];
     const uint32_t leading = row->wire.leading, size = attrib->value_size;
     if (leading) {
+        // Family, and mask length of a prefix, then the address; the gap between them isn't sent.
         memcpy(bytes, attrib->value.bytes, leading);
-        turn(attrib->value.bytes + stored_address, bytes + leading, ADDRESS_SIZE);
+        reverse_value(attrib->value.bytes + stored_address, bytes + leading, ADDRESS_SIZE);
         *out = leading + ADDRESS_SIZE;
         return tb_put_buf(buffer, offset, bytes, *out);
     }
     CHECK_CONDITION(size <= sizeof bytes);
     if (row->wire.kind == wire_kind_number)
-        turn(attrib->value.bytes, bytes, size);
+        reverse_value(attrib->value.bytes, bytes, size);
     else
         memcpy(bytes, attrib->value.bytes, size);
     return put_sized(buffer, offset, bytes, size, out);
@@ -119,7 +120,7 @@ lc_status bn_attrib_append_wire(const bn_attrib *attrib, tbuffer *buffer) {
 
 namespace {
 
-uint32_t number_at(const uint8_t *bytes) {
+uint32_t load_be32(const uint8_t *bytes) {
     be32 wire;
     memcpy(wire.bytes, bytes, sizeof wire);
     return to_host(wire);
@@ -158,7 +159,7 @@ lc_status locate_value(bn_wire_attrib *out, const uint8_t *at, uint32_t rest) {
     }
     CHECK_CONDITION(rest >= 4);
     out->value = at + 4;
-    out->length = number_at(at);
+    out->length = load_be32(at);
     rest -= 4;
     if (row->wire.kind == wire_kind_counted) {
         if (out->length > rest)
@@ -180,17 +181,18 @@ lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, 
     CHECK_NULL(buffer);
     CHECK_CONDITION(offset <= buffer->length && HEADER_SIZE <= buffer->length - offset);
     const uint8_t *at = buffer->buffer + offset;
-    const uint32_t type_found = number_at(at + TYPE_OFFSET);
+    const uint32_t type_found = load_be32(at + TYPE_OFFSET);
     if (!type)
         type = type_found;
     CHECK_CONDITION(type >= 1 && type <= BN_TYPE_LAST);
     const bn_type_row *row = bn_type_find(type);
     CHECK_NULL(row);
     CHECK_NULL(bn_attrib_copy_funcs[type].read);
-    if (number_at(at) != row->wire.kind)
+    // The kind is checked before the value, whose layout depends on it.
+    if (load_be32(at) != row->wire.kind)
         FAIL_WITH(LC_GENERIC);
     CHECK_QUIET(check_type(type_found, type));
-    *out = {row, number_at(at + 4), number_at(at + 12) & ~BN_TYPE_MASK, nullptr, 0, 0};
+    *out = {row, load_be32(at + 4), load_be32(at + 12) & ~BN_TYPE_MASK, nullptr, 0, 0};
     CHECK_CONDITION(bn_attrib_id_valid(out->id));
     CHECK_QUIET(locate_value(out, at + HEADER_SIZE, buffer->length - offset - HEADER_SIZE));
     out->used = static_cast<uint32_t>(out->value - at) + out->length;
@@ -211,9 +213,9 @@ void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
         return;
     if (leading) {
         memcpy(out->value.bytes, found->value, leading);
-        turn(found->value + leading, out->value.bytes + stored_address, ADDRESS_SIZE);
+        reverse_value(found->value + leading, out->value.bytes + stored_address, ADDRESS_SIZE);
     } else if (found->row->wire.kind == wire_kind_number) {
-        turn(found->value, out->value.bytes, found->length);
+        reverse_value(found->value, out->value.bytes, found->length);
     } else {
         memcpy(out->value.bytes, found->value, found->length);
     }
@@ -240,7 +242,7 @@ void bn_wire_fill(const bn_wire_attrib *found, char *text, bn_attrib *out) {
 
 namespace {
 
-lc_status take_copy(const bn_wire_attrib *found, bn_attrib *attrib) {
+lc_status copy_value(const bn_wire_attrib *found, bn_attrib *attrib) {
     owned_text bytes(static_cast<char *>(malloc(size_t{found->length} + 1)));
     CHECK_NULL(bytes.pointer);
     memcpy(bytes.pointer, found->value, found->length);
@@ -271,7 +273,7 @@ lc_status bn_wire_read(const tbuffer *buffer, uint32_t offset, uint32_t type, bn
     CHECK_STATUS(bn_attrib_new(&attrib.pointer));
     bn_wire_fill(&found, nullptr, attrib.pointer);
     if (bn_wire_has_text(&found))
-        CHECK_STATUS(take_copy(&found, attrib.pointer));
+        CHECK_STATUS(copy_value(&found, attrib.pointer));
     *out = attrib.take();
     if (out_used)
         *out_used = found.used;

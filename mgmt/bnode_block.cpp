@@ -52,14 +52,14 @@ namespace {
 bool is_bare(const tstring *name) {
     return name->length == 0 || (name->length == 1 && name->buffer[0] == '/');
 }
-uint32_t attributes_of(const bn_binding *binding) {
+uint32_t count_attributes(const bn_binding *binding) {
     return binding->attributes ? binding->attributes->count : 0;
 }
-const tstring *text_of(const bn_attrib *attrib) {
+const tstring *string_value_of(const bn_attrib *attrib) {
     const bn_type_row *row = bn_type_find(attrib->type);
     return row && row->shape == value_shape::text ? attrib->value.string : nullptr;
 }
-const tbuffer *binary_of(const bn_attrib *attrib) {
+const tbuffer *binary_value_of(const bn_attrib *attrib) {
     const bn_type_row *row = bn_type_find(attrib->type);
     return row && row->shape == value_shape::binary ? attrib->value.binary : nullptr;
 }
@@ -67,13 +67,13 @@ const tbuffer *binary_of(const bn_attrib *attrib) {
 } // namespace
 
 void bn_size_copy(bn_block_size *size, const bn_binding *binding) {
-    const uint32_t count = attributes_of(binding);
+    const uint32_t count = count_attributes(binding);
     bn_size_binding(size, static_cast<size_t>(binding->name->length), is_bare(binding->name), count);
     for (uint32_t i = 0; i < count; i++) {
         const bn_attrib *attrib = binding->attributes->slots[i].attrib;
-        if (const tstring *text = text_of(attrib))
+        if (const tstring *text = string_value_of(attrib))
             bn_size_text(size, static_cast<size_t>(text->length));
-        else if (const tbuffer *binary = binary_of(attrib))
+        else if (const tbuffer *binary = binary_value_of(attrib))
             bn_size_text(size, binary->length);
     }
 }
@@ -176,8 +176,8 @@ bn_block *bn_block_of(bn_binding *binding) {
 namespace {
 
 lc_status place_value(bn_block_builder *builder, const bn_attrib *from, bn_attrib *to) {
-    const tstring *string = text_of(from);
-    const tbuffer *binary = binary_of(from);
+    const tstring *string = string_value_of(from);
+    const tbuffer *binary = binary_value_of(from);
     if (!string && !binary) {
         *to = *from;
         return LC_OK;
@@ -200,7 +200,7 @@ lc_status place_value(bn_block_builder *builder, const bn_attrib *from, bn_attri
 } // namespace
 
 lc_status bn_place_copy(bn_block_builder *builder, const bn_binding *binding, bn_binding **out) {
-    const uint32_t count = attributes_of(binding);
+    const uint32_t count = count_attributes(binding);
     const tstring *name = binding->name;
     owned<bn_binding, bn_release_binding> copy;
     char *text = nullptr;

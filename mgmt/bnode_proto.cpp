@@ -85,22 +85,22 @@ void free_request_node(void *node) {
 void free_response_node(void *node) {
     bn_response_node_free(static_cast<bn_response_node *>(node));
 }
-void fill_request_nodes(array_options *options) {
+void set_request_node_options(array_options *options) {
     options->free = free_request_node;
 }
-void fill_response_nodes(array_options *options) {
+void set_response_node_options(array_options *options) {
     options->free = free_response_node;
 }
 
 } // namespace
 
-TYPED_ARRAY_DEFINE(bn_request_per_node_array, bn_request_node *, fill_request_nodes)
-TYPED_ARRAY_DEFINE(bn_response_per_node_array, bn_response_node *, fill_response_nodes)
+TYPED_ARRAY_DEFINE(bn_request_per_node_array, bn_request_node *, set_request_node_options)
+TYPED_ARRAY_DEFINE(bn_response_per_node_array, bn_response_node *, set_response_node_options)
 
 namespace {
 
 // Options for an array that will have `count` elements.
-array_options options_for(uint32_t count, void (*fill)(array_options *)) {
+array_options array_options_for(uint32_t count, void (*fill)(array_options *)) {
     array_options options = {};
     (void)array_options_get_defaults(&options);
     fill(&options);
@@ -111,11 +111,11 @@ array_options options_for(uint32_t count, void (*fill)(array_options *)) {
 } // namespace
 
 lc_status bn_request_nodes_new(bn_request_per_node_array **out, uint32_t count) {
-    const array_options options = options_for(count, fill_request_nodes);
+    const array_options options = array_options_for(count, set_request_node_options);
     return bn_request_per_node_array_new_full(out, &options);
 }
 lc_status bn_response_nodes_new(bn_response_per_node_array **out, uint32_t count) {
-    const array_options options = options_for(count, fill_response_nodes);
+    const array_options options = array_options_for(count, set_response_node_options);
     return bn_response_per_node_array_new_full(out, &options);
 }
 
@@ -223,7 +223,7 @@ lc_status bn_query_request_msg_append_str(bn_request_msg *msg, uint32_t subop, u
 namespace {
 
 // Adds an attribute without a value for each of these ids.
-lc_status ask_for_attributes(bn_binding *binding, const bn_attrib_array *attributes) {
+lc_status add_requested_attributes(bn_binding *binding, const bn_attrib_array *attributes) {
     const uint32_t count = bn_attrib_array_length_quick(attributes);
     for (uint32_t id = 0; id < count; id++)
         if (bn_attrib_array_get_quick(attributes, id))
@@ -245,7 +245,7 @@ lc_status bn_query_request_msg_append_with_attribs(bn_request_msg *msg, uint32_t
     } else {
         CHECK_STATUS(bn_binding_new_named(&binding.pointer, node_name));
         if (attributes)
-            CHECK_STATUS(ask_for_attributes(binding.pointer, attributes));
+            CHECK_STATUS(add_requested_attributes(binding.pointer, attributes));
     }
     CHECK_STATUS(append_node(msg, bn_msg_query_request, subop, flags, &binding.pointer, out_node_id));
     return LC_OK;
@@ -307,7 +307,7 @@ lc_status bn_event_request_msg_append_new_binding(bn_request_msg *msg, uint32_t,
 
 namespace {
 
-lc_status get_text(const bn_request_msg *msg, uint16_t type, tstring **out) {
+lc_status copy_message_text(const bn_request_msg *msg, uint16_t type, tstring **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(msg);
@@ -320,11 +320,11 @@ lc_status get_text(const bn_request_msg *msg, uint16_t type, tstring **out) {
 } // namespace
 
 lc_status bn_action_request_msg_get_action_name(const bn_request_msg *msg, tstring **out) {
-    CHECK_STATUS(get_text(msg, bn_msg_action_request, out));
+    CHECK_STATUS(copy_message_text(msg, bn_msg_action_request, out));
     return LC_OK;
 }
 lc_status bn_event_request_msg_get_event_name(const bn_request_msg *msg, tstring **out) {
-    CHECK_STATUS(get_text(msg, bn_msg_event, out));
+    CHECK_STATUS(copy_message_text(msg, bn_msg_event, out));
     return LC_OK;
 }
 lc_status bn_request_set_transaction_id(bn_request_msg *msg, uint32_t transaction_id) {
@@ -461,7 +461,7 @@ namespace {
 
 // Makes the parts of a name if the reader wants them, otherwise drops them. A name that has none ("" or "/")
 // gets none.
-lc_status settle_parts(bn_binding *binding, int keep_parts) {
+lc_status make_or_drop_parts(bn_binding *binding, int keep_parts) {
     if (!keep_parts)
         return bn_binding_drop_name_parts(binding);
     const char *name = ts_str(binding->name);
@@ -485,8 +485,8 @@ lc_status begin_reading(reading *into, uint32_t count) {
     CHECK_STATUS(bn_binding_array_new_sized(&into->bindings.pointer, count));
     return LC_OK;
 }
-lc_status take_into(reading *into, bn_binding **inout_binding, int keep_parts) {
-    CHECK_STATUS(settle_parts(*inout_binding, keep_parts));
+lc_status append_to_reading(reading *into, bn_binding **inout_binding, int keep_parts) {
+    CHECK_STATUS(make_or_drop_parts(*inout_binding, keep_parts));
     CHECK_STATUS(bn_binding_array_append_takeover(into->bindings.pointer, inout_binding));
     return LC_OK;
 }
@@ -507,7 +507,7 @@ lc_status copy_bindings(const NodeArray *nodes, uint32_t count, Get get, int kee
         CHECK_STATUS(bn_place_copy(&builder, binding, &copy.pointer));
         if (keep_parts && binding->parts)
             CHECK_STATUS(tstr_array_duplicate(binding->parts, &copy.pointer->parts));
-        CHECK_STATUS(take_into(into, &copy.pointer, keep_parts));
+        CHECK_STATUS(append_to_reading(into, &copy.pointer, keep_parts));
     }
     return LC_OK;
 }
@@ -573,7 +573,7 @@ lc_status move_bindings(const bn_response_msg *msg, uint32_t count, int keep_par
     for (uint32_t i = 0; i < count; i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
         if (node->binding)
-            CHECK_STATUS(take_into(into, &node->binding, keep_parts));
+            CHECK_STATUS(append_to_reading(into, &node->binding, keep_parts));
     }
     return LC_OK;
 }

@@ -22,7 +22,7 @@ struct dump_names {
             (void)lc_log_internal(nullptr, nullptr, 0, 0, 0, (target)->level, __VA_ARGS__);                  \
     } while (0)
 
-bool is_wanted(int32_t level) {
+bool is_level_wanted(int32_t level) {
     int32_t maximum = 0;
     return level != -1 && lc_log_get_max_log_level(&maximum) == LC_OK && maximum >= level;
 }
@@ -31,7 +31,7 @@ const char *text_or_empty(const tstring *text) {
     return text ? ts_str(text) : "";
 }
 
-dump_names names_of(gcl_session *session) {
+dump_names get_dump_names(gcl_session *session) {
     const char *local = nullptr, *peer = nullptr;
     if (session)
         (void)gcl_session_get_session_names(session, &local, &peer);
@@ -82,10 +82,10 @@ void dump_subop(const dump_target *to, uint32_t index, const bn_request_node *no
 } // namespace
 
 void bn_request_msg_dump(gcl_session *session, const bn_request_msg *msg, int32_t level, const char *title) {
-    if (!msg || !is_wanted(level))
+    if (!msg || !is_level_wanted(level))
         return;
     const dump_target to = {level, title};
-    const dump_names names = names_of(session);
+    const dump_names names = get_dump_names(session);
     DUMP(&to, "%s:%s%s%s%s%s service %d type %d (%s) msg id %d", title, names.local_gap, names.local,
          names.peer_gap, names.peer, "", msg->service_id, msg->msg_type,
          lc_enum_to_string_quiet(bn_msg_type_table, msg->msg_type), static_cast<int>(msg->msg_id));
@@ -108,10 +108,10 @@ void bn_request_msg_dump(gcl_session *session, const bn_request_msg *msg, int32_
 
 void bn_response_msg_dump(gcl_session *session, const bn_response_msg *msg, int32_t level,
                           const char *title) {
-    if (!msg || !is_wanted(level))
+    if (!msg || !is_level_wanted(level))
         return;
     const dump_target to = {level, title};
-    const dump_names names = names_of(session);
+    const dump_names names = get_dump_names(session);
     DUMP(&to, "%s: ret code: %d ret msg: \"%s\"", title, static_cast<int>(msg->return_code),
          text_or_empty(msg->return_message));
     DUMP(&to, "%s:%s%s%s%s%s service %d type %d (%s) msg id %d to %d", title, names.local_gap, names.local,

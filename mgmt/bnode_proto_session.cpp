@@ -46,14 +46,14 @@ bn_session_state *session_state(gcl_session *session) {
 
 // --- Callbacks
 
-lc_status set_global(gcl *instance, uint16_t type, bn_callback callback) {
+lc_status set_instance_callback(gcl *instance, uint16_t type, bn_callback callback) {
     CHECK_NULL(instance);
     bn_instance_state *state = instance_state(instance);
     CHECK_NULL(state);
     state->callbacks[type] = callback;
     return LC_OK;
 }
-lc_status set_session(gcl_session *session, uint16_t type, bn_callback callback) {
+lc_status set_session_callback(gcl_session *session, uint16_t type, bn_callback callback) {
     CHECK_NULL(session);
     const gcl_session_guard guard(session);
     bn_session_state *state = session_state(session);
@@ -67,20 +67,20 @@ lc_status set_session(gcl_session *session, uint16_t type, bn_callback callback)
 // Define bn_set_global_callback_query_request_msg, bn_set_session_callback_query_request_msg and so on.
 #define BN_REQUEST_SETTERS(kind, type)                                                                       \
     lc_status bn_set_global_callback_##kind##_msg(gcl *instance, bn_request_callback callback, void *data) { \
-        return set_global(instance, type, {callback, nullptr, data});                                        \
+        return set_instance_callback(instance, type, {callback, nullptr, data});                             \
     }                                                                                                        \
     lc_status bn_set_session_callback_##kind##_msg(gcl_session *session, bn_request_callback callback,       \
                                                    void *data) {                                             \
-        return set_session(session, type, {callback, nullptr, data});                                        \
+        return set_session_callback(session, type, {callback, nullptr, data});                               \
     }
 #define BN_RESPONSE_SETTERS(kind, type)                                                                      \
     lc_status bn_set_global_callback_##kind##_msg(gcl *instance, bn_response_callback callback,              \
                                                   void *data) {                                              \
-        return set_global(instance, type, {nullptr, callback, data});                                        \
+        return set_instance_callback(instance, type, {nullptr, callback, data});                             \
     }                                                                                                        \
     lc_status bn_set_session_callback_##kind##_msg(gcl_session *session, bn_response_callback callback,      \
                                                    void *data) {                                             \
-        return set_session(session, type, {nullptr, callback, data});                                        \
+        return set_session_callback(session, type, {nullptr, callback, data});                               \
     }
 BN_REQUEST_SETTERS(query_request, bn_msg_query_request)
 BN_RESPONSE_SETTERS(query_response, bn_msg_query_response)
@@ -113,6 +113,7 @@ lc_status number_message(gcl_session *session, Message *msg) {
     msg->msg_id = state->next_msg_id++;
     if (msg->service_id == 0)
         msg->service_id = service_of(session);
+    // By definition the id that the next message will have; the peer doesn't check it.
     if (msg->transaction_id == 0) {
         msg->transaction_id = state->next_msg_id;
         state->transactions++;
@@ -120,18 +121,18 @@ lc_status number_message(gcl_session *session, Message *msg) {
     return LC_OK;
 }
 
-bool is_connected(gcl_session *session) {
+bool is_session_connected(gcl_session *session) {
     int32_t state = GCL_SESSION_NONE;
     return gcl_session_get_state(session, &state, nullptr) == LC_OK && state == GCL_SESSION_CONNECTED;
 }
 
 // What differs between sending the two kinds of message.
-struct request_kind {
+struct request_sending {
     static constexpr const char *title = "SEND REQ", *word = "request";
     static constexpr auto serialize = bn_request_msg_serialize;
     static constexpr auto dump = bn_request_msg_dump;
 };
-struct response_kind {
+struct response_sending {
     static constexpr const char *title = "SEND RESP", *word = "response";
     static constexpr auto serialize = bn_response_msg_serialize;
     static constexpr auto dump = bn_response_msg_dump;
@@ -158,7 +159,7 @@ lc_status send_message(gcl_session *session, Message *msg) {
     owned_tbuffer buffer;
     CHECK_STATUS(Kind::serialize(msg, BN_FRAME_HEADER_BYTES, &buffer.pointer));
     Kind::dump(session, msg, LC_LOG_DEBUG, Kind::title);
-    if (!is_connected(session)) {
+    if (!is_session_connected(session)) {
         LC_LOG(LC_LOG_INFO, "Dropping %s to non-connected session %d", Kind::word,
                gcl_session_get_id(session));
         return LC_OK;
@@ -183,7 +184,7 @@ lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, lc_stat
     refusal.pointer->transaction_id = msg->transaction_id;
     owned_tbuffer buffer;
     CHECK_STATUS(bn_response_msg_serialize(refusal.pointer, BN_FRAME_HEADER_BYTES, &buffer.pointer));
-    bn_response_msg_dump(session, refusal.pointer, LC_LOG_DEBUG, response_kind::title);
+    bn_response_msg_dump(session, refusal.pointer, LC_LOG_DEBUG, response_sending::title);
     CHECK_STATUS(gcl_session_send_refusal_tb(session, BN_PROTO, msg->msg_type, &buffer.pointer));
     return LC_OK;
 }
@@ -191,13 +192,13 @@ lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, lc_stat
 } // namespace
 
 lc_status bn_request_msg_send(gcl_session *session, bn_request_msg *msg) {
-    return send_message<request_kind>(session, msg);
+    return send_message<request_sending>(session, msg);
 }
 lc_status bn_response_msg_send(gcl_session *session, bn_response_msg *msg) {
     CHECK_NULL(session);
     // Held throughout, so that no other thread sends between the attempt and the refusal.
     const gcl_session_guard guard(session);
-    const lc_status status = send_message<response_kind>(session, msg);
+    const lc_status status = send_message<response_sending>(session, msg);
     if (status != LC_NO_BUFFER_SPACE && status != LC_CANCELLED)
         return status;
     return send_refusal(session, msg, status);

@@ -88,13 +88,13 @@ lc_status put_string(tbuffer *buffer, const tstring *text) {
         CHECK_STATUS(tb_append_buf(buffer, ts_str(text), static_cast<uint32_t>(length)));
     return LC_OK;
 }
-uint32_t used(const tbuffer *buffer) {
+uint32_t bytes_used(const tbuffer *buffer) {
     return static_cast<uint32_t>(tb_length(buffer));
 }
 
 // Writes one part of a name without its escapes, in runs of bytes that need no change.
-lc_status put_escaped_part(tbuffer *buffer, const char *part, const char *end) {
-    const uint32_t length_at = used(buffer);
+lc_status put_unescaped_part(tbuffer *buffer, const char *part, const char *end) {
+    const uint32_t length_at = bytes_used(buffer);
     CHECK_STATUS(put_u32(buffer, 0));
     const char *run = part;
     for (; part < end; part++)
@@ -103,7 +103,7 @@ lc_status put_escaped_part(tbuffer *buffer, const char *part, const char *end) {
             run = ++part; // begins with the character that was escaped
         }
     CHECK_STATUS(tb_append_buf(buffer, run, static_cast<uint32_t>(end - run)));
-    CHECK_STATUS(put_u32_at(buffer, length_at, used(buffer) - length_at - 4));
+    CHECK_STATUS(put_u32_at(buffer, length_at, bytes_used(buffer) - length_at - 4));
     return LC_OK;
 }
 // Splits the name while it writes it, since making an array of parts for each binding of a message would be
@@ -111,7 +111,7 @@ lc_status put_escaped_part(tbuffer *buffer, const char *part, const char *end) {
 lc_status put_name_text(tbuffer *buffer, const char *name) {
     const bool absolute = *name == '/';
     CHECK_STATUS(tb_append_uint8(buffer, absolute));
-    const uint32_t count_at = used(buffer);
+    const uint32_t count_at = bytes_used(buffer);
     CHECK_STATUS(put_u32(buffer, 0));
     const char *part = name + absolute;
     uint32_t count = 0;
@@ -119,7 +119,7 @@ lc_status put_name_text(tbuffer *buffer, const char *name) {
     // one.
     for (const char *end; *part || count; part = end + 1) {
         end = bn_part_end(part);
-        CHECK_STATUS(put_escaped_part(buffer, part, end));
+        CHECK_STATUS(put_unescaped_part(buffer, part, end));
         count++;
         if (!*end)
             break;
@@ -142,7 +142,7 @@ lc_status put_name(tbuffer *buffer, const bn_binding *binding) {
 }
 
 lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
-    const uint32_t count_at = used(buffer);
+    const uint32_t count_at = bytes_used(buffer);
     CHECK_STATUS(put_u32(buffer, 0));
     uint32_t written = 0;
     const bn_attrib_array *attributes = binding->attributes;
@@ -159,11 +159,11 @@ lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
 }
 
 // What is between the header and the nodes.
-lc_status put_head(tbuffer *buffer, const bn_request_msg *msg) {
+lc_status put_message_head(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_string(buffer, msg->audit_user));
     return LC_OK;
 }
-lc_status put_head(tbuffer *buffer, const bn_response_msg *msg) {
+lc_status put_message_head(tbuffer *buffer, const bn_response_msg *msg) {
     CHECK_STATUS(put_u32(buffer, msg->return_code));
     CHECK_STATUS(put_string(buffer, msg->return_message));
     return LC_OK;
@@ -211,11 +211,11 @@ struct wire_text {
     uint32_t length;
 };
 
-size_t rest_of(const wire_reader *reader) {
+size_t bytes_left(const wire_reader *reader) {
     return static_cast<size_t>(reader->end - reader->at);
 }
 lc_status get_bytes(wire_reader *reader, void *out, size_t count) {
-    CHECK_CONDITION(count <= rest_of(reader));
+    CHECK_CONDITION(count <= bytes_left(reader));
     memcpy(out, reader->at, count);
     reader->at += count;
     return LC_OK;
@@ -226,16 +226,16 @@ lc_status get_u32(wire_reader *reader, uint32_t *out) {
     *out = to_host(wire);
     return LC_OK;
 }
-lc_status find_text(wire_reader *reader, wire_text *out) {
+lc_status locate_text(wire_reader *reader, wire_text *out) {
     CHECK_STATUS(get_u32(reader, &out->length));
-    if (out->length > rest_of(reader))
+    if (out->length > bytes_left(reader))
         CHECK_STATUS(LC_NO_BUFFER_SPACE);
     out->bytes = reader->at;
     reader->at += out->length;
     return LC_OK;
 }
-lc_status find_string(wire_reader *reader, wire_text *out) {
-    CHECK_STATUS(find_text(reader, out));
+lc_status locate_checked_text(wire_reader *reader, wire_text *out) {
+    CHECK_STATUS(locate_text(reader, out));
     CHECK_STATUS(bn_check_text(out->bytes, out->length));
     CHECK_CONDITION(out->length < ts_size_max);
     return LC_OK;
@@ -243,18 +243,18 @@ lc_status find_string(wire_reader *reader, wire_text *out) {
 // A null string is sent as one of length 0, and is received as an empty one.
 lc_status get_string(wire_reader *reader, tstring **out) {
     wire_text found = {};
-    CHECK_STATUS(find_string(reader, &found));
+    CHECK_STATUS(locate_checked_text(reader, &found));
     CHECK_STATUS(ts_new_size(out, found.length + 1));
     CHECK_STATUS(ts_append_str_frag(*out, reinterpret_cast<const char *>(found.bytes), 0,
                                     static_cast<int32_t>(found.length)));
     return LC_OK;
 }
 
-lc_status get_head(wire_reader *reader, bn_request_msg *msg) {
+lc_status get_message_head(wire_reader *reader, bn_request_msg *msg) {
     CHECK_STATUS(get_string(reader, &msg->audit_user));
     return LC_OK;
 }
-lc_status get_head(wire_reader *reader, bn_response_msg *msg) {
+lc_status get_message_head(wire_reader *reader, bn_response_msg *msg) {
     CHECK_STATUS(get_u32(reader, &msg->return_code));
     CHECK_STATUS(get_string(reader, &msg->return_message));
     return LC_OK;
@@ -340,7 +340,7 @@ lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *o
     bool first_is_empty = false;
     for (uint32_t i = 0; i < out->parts; i++) {
         wire_text part = {};
-        CHECK_STATUS(find_text(reader, &part));
+        CHECK_STATUS(locate_text(reader, &part));
         CHECK_STATUS(measure_part(&part, i + 1 < out->parts, extent, &out->length));
         first_is_empty = i ? first_is_empty : part.length == 0;
     }
@@ -358,7 +358,7 @@ lc_status write_name(const wire_reader *reader, const wire_name *name, bool esca
         *out++ = '/';
     for (uint32_t i = 0; i < name->parts; i++) {
         wire_text part = {};
-        CHECK_STATUS(find_text(&parts, &part));
+        CHECK_STATUS(locate_text(&parts, &part));
         if (i)
             *out++ = '/';
         if (!escapes)
@@ -369,7 +369,7 @@ lc_status write_name(const wire_reader *reader, const wire_name *name, bool esca
 }
 
 // Locates an attribute and advances the reader past it.
-lc_status find_attribute(wire_reader *reader, bn_wire_attrib *out) {
+lc_status locate_attribute(wire_reader *reader, bn_wire_attrib *out) {
     const auto offset = static_cast<uint32_t>(reader->at - reader->buffer->buffer);
     CHECK_STATUS(bn_wire_locate(reader->buffer, offset, 0, out));
     reader->at += out->used;
@@ -383,7 +383,7 @@ lc_status measure_binding(wire_reader *reader, message_extent *extent) {
     CHECK_STATUS(get_u32(reader, &count));
     for (uint32_t i = 0; i < count; i++) {
         bn_wire_attrib found = {};
-        CHECK_STATUS(find_attribute(reader, &found));
+        CHECK_STATUS(locate_attribute(reader, &found));
         if (bn_wire_has_text(&found))
             bn_size_text(size, found.length);
     }
@@ -392,7 +392,7 @@ lc_status measure_binding(wire_reader *reader, message_extent *extent) {
 }
 lc_status place_attribute(wire_reader *reader, bn_block_builder *builder, bn_attrib_array *array) {
     bn_wire_attrib found = {};
-    CHECK_STATUS(find_attribute(reader, &found));
+    CHECK_STATUS(locate_attribute(reader, &found));
     auto *attrib = static_cast<bn_attrib *>(bn_place_record(builder, sizeof(bn_attrib)));
     CHECK_NULL(attrib);
     char *text = nullptr;
@@ -438,7 +438,7 @@ lc_status measure_set_node(wire_reader *reader, bn_block_size *size) {
     CHECK_STATUS(skip_subop(reader, &subop));
     for (int i = 0; i < 2 && subop == bn_set_reparent; i++) {
         wire_text text = {};
-        CHECK_STATUS(find_string(reader, &text));
+        CHECK_STATUS(locate_checked_text(reader, &text));
         bn_size_record(size, sizeof(tstring));
         bn_size_text(size, text.length);
     }
@@ -451,7 +451,7 @@ lc_status place_query_node(wire_reader *reader, bn_block_builder *, bn_request_n
 }
 lc_status place_string(wire_reader *reader, bn_block_builder *builder, tstring **out) {
     wire_text text = {};
-    CHECK_STATUS(find_string(reader, &text));
+    CHECK_STATUS(locate_checked_text(reader, &text));
     CHECK_STATUS(bn_place_string(builder, reinterpret_cast<const char *>(text.bytes), text.length, out));
     return LC_OK;
 }
@@ -536,13 +536,14 @@ struct response_kind {
 lc_status start_buffer(uint32_t header_bytes, owned_tbuffer *out) {
     CHECK_STATUS(tb_new(&out->pointer));
     const uint8_t zero = 0;
+    // Writing the last byte fills everything before it with zeros.
     if (header_bytes > 0)
         CHECK_STATUS(tb_put_buf(out->pointer, header_bytes - 1, &zero, 1));
     return LC_OK;
 }
 
 template <typename Kind>
-lc_status serialize(typename Kind::message *msg, uint32_t header_bytes, tbuffer **out) {
+lc_status serialize_message(typename Kind::message *msg, uint32_t header_bytes, tbuffer **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(msg);
@@ -554,8 +555,8 @@ lc_status serialize(typename Kind::message *msg, uint32_t header_bytes, tbuffer 
     typename Kind::header header = {};
     msg->length = 0;
     CHECK_STATUS(tb_append_buf(bytes, &header, sizeof header));
-    CHECK_STATUS(put_head(bytes, msg));
-    const uint32_t count_at = used(bytes);
+    CHECK_STATUS(put_message_head(bytes, msg));
+    const uint32_t count_at = bytes_used(bytes);
     CHECK_STATUS(put_u32(bytes, 0));
     uint32_t written = 0;
     const uint32_t count = Kind::node_count(msg->nodes);
@@ -573,7 +574,7 @@ lc_status serialize(typename Kind::message *msg, uint32_t header_bytes, tbuffer 
     CHECK_STATUS(put_u32_at(bytes, count_at, written));
     if (trailers.put_message)
         CHECK_STATUS(trailers.put_message(bytes, msg));
-    msg->length = used(bytes);
+    msg->length = bytes_used(bytes);
     Kind::swap(msg, &header);
     CHECK_STATUS(tb_put_buf(bytes, header_bytes, &header, sizeof header));
     *out = buffer.take();
@@ -608,6 +609,7 @@ lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers *trail
         node->msg_type = msg->msg_type;
         CHECK_STATUS(get_u32(reader, &node->node_id));
         CHECK_STATUS(place_binding(reader, extent, &builder, &node->binding));
+        // The message owns the node from here on, so a later failure frees it with the message.
         CHECK_STATUS(Kind::append(msg->nodes, &node));
         if (trailers->place_node)
             CHECK_STATUS(trailers->place_node(reader, &builder, Kind::node_at(msg->nodes, i)));
@@ -617,7 +619,7 @@ lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers *trail
 
 // Nodes are allocated only after all of them and the message trailer have been checked.
 template <typename Kind>
-lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Kind::message **out) {
+lc_status deserialize_message(const tbuffer *buffer, uint32_t offset, typename Kind::message **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(buffer);
@@ -629,7 +631,7 @@ lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Kind::mes
     CHECK_STATUS(Kind::new_message(&msg.pointer, to_host(header.msg_type)));
     Kind::swap(&header, msg.pointer);
     const auto trailers = Kind::trailers_of(msg.pointer->msg_type);
-    CHECK_STATUS(get_head(&reader, msg.pointer));
+    CHECK_STATUS(get_message_head(&reader, msg.pointer));
     uint32_t count = 0;
     message_extent extent = {};
     CHECK_STATUS(get_u32(&reader, &count));
@@ -648,14 +650,14 @@ lc_status deserialize(const tbuffer *buffer, uint32_t offset, typename Kind::mes
 } // namespace
 
 lc_status bn_request_msg_serialize(bn_request_msg *msg, uint32_t header_bytes, tbuffer **out) {
-    return serialize<request_kind>(msg, header_bytes, out);
+    return serialize_message<request_kind>(msg, header_bytes, out);
 }
 lc_status bn_response_msg_serialize(bn_response_msg *msg, uint32_t header_bytes, tbuffer **out) {
-    return serialize<response_kind>(msg, header_bytes, out);
+    return serialize_message<response_kind>(msg, header_bytes, out);
 }
 lc_status bn_request_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
-    return deserialize<request_kind>(buffer, offset, out);
+    return deserialize_message<request_kind>(buffer, offset, out);
 }
 lc_status bn_response_msg_deserialize(const tbuffer *buffer, uint32_t offset, bn_response_msg **out) {
-    return deserialize<response_kind>(buffer, offset, out);
+    return deserialize_message<response_kind>(buffer, offset, out);
 }

@@ -51,6 +51,13 @@ int64_t bn_value_integer(const bn_type_row *row, const bn_attrib *attrib);
 lc_status bn_text_to_natural(const char *text, uint64_t limit, uint64_t *out);
 lc_status bn_text_to_integer(const char *text, int64_t least, int64_t most, int64_t *out);
 
+// Gives a text in memory of malloc(), or LC_NULL, logged, if there was no memory for it.
+inline lc_status bn_give_text(char *text, char **out) {
+    CHECK_NULL(text);
+    *out = text;
+    return LC_OK;
+}
+
 // As lc_str_to_ipaddr and lc_str_to_ipprefix, but every failure is LC_BAD_TYPE and is not logged.
 lc_status bn_text_to_ipaddr(const char *text, lc_ipaddr *out);
 lc_status bn_text_to_ipprefix(const char *text, lc_ipprefix *out);

@@ -61,7 +61,7 @@ lc_status bn_text_to_integer(const char *text, int64_t least, int64_t most, int6
 namespace {
 
 template <typename Number>
-Number loaded(const bn_attrib *attrib) {
+Number load_value(const bn_attrib *attrib) {
     Number value;
     memcpy(&value, attrib->value.bytes, sizeof value);
     return value;
@@ -72,13 +72,13 @@ Number loaded(const bn_attrib *attrib) {
 uint64_t bn_value_natural(const bn_type_row *row, const bn_attrib *attrib) {
     switch (row->size) {
     case 1:
-        return loaded<uint8_t>(attrib);
+        return load_value<uint8_t>(attrib);
     case 2:
-        return loaded<uint16_t>(attrib);
+        return load_value<uint16_t>(attrib);
     case 4:
-        return loaded<uint32_t>(attrib);
+        return load_value<uint32_t>(attrib);
     case 8:
-        return loaded<uint64_t>(attrib);
+        return load_value<uint64_t>(attrib);
     default:
         return 0;
     }
@@ -92,70 +92,65 @@ int64_t bn_value_integer(const bn_type_row *row, const bn_attrib *attrib) {
 
 namespace {
 
-void store_low(const bn_type_row *row, uint64_t value, bn_attrib *attrib) {
+void store_number(const bn_type_row *row, uint64_t value, bn_attrib *attrib) {
     static_assert(std::endian::native == std::endian::little);
     memcpy(attrib->value.bytes, &value, std::min<size_t>(row->size, sizeof value));
 }
 
-lc_status text_given(char *text, char **out) {
-    CHECK_NULL(text);
-    *out = text;
-    return LC_OK;
+lc_status natural_to_text(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+    return bn_give_text(smprintf("%lu", bn_value_natural(row, attrib)), out);
 }
-lc_status natural_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
-    return text_given(smprintf("%lu", bn_value_natural(row, attrib)), out);
-}
-lc_status natural_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status natural_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     uint64_t value = 0;
     CHECK_QUIET(bn_text_to_natural(text, UINT64_MAX >> (64 - 8 * row->size), &value));
-    store_low(row, value, attrib);
+    store_number(row, value, attrib);
     return LC_OK;
 }
-lc_status integer_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
-    return text_given(smprintf("%ld", bn_value_integer(row, attrib)), out);
+lc_status integer_to_text(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+    return bn_give_text(smprintf("%ld", bn_value_integer(row, attrib)), out);
 }
-lc_status integer_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status integer_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     const int64_t most = INT64_MAX >> (64 - 8 * row->size);
     int64_t value = 0;
     CHECK_QUIET(bn_text_to_integer(text, -most - 1, most, &value));
-    store_low(row, static_cast<uint64_t>(value), attrib);
+    store_number(row, static_cast<uint64_t>(value), attrib);
     return LC_OK;
 }
-lc_status bool_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
-    return text_given(safe_strdup(lc_bool_to_str(bn_value_natural(row, attrib) != 0)), out);
+lc_status bool_to_text(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+    return bn_give_text(safe_strdup(lc_bool_to_str(bn_value_natural(row, attrib) != 0)), out);
 }
-lc_status bool_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status bool_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     int32_t value = 0;
     CHECK_QUIET(lc_str_to_bool(text, &value));
-    store_low(row, value != 0, attrib);
+    store_number(row, value != 0, attrib);
     return LC_OK;
 }
 template <typename Real>
-Real real_of(const char *text, char **end) {
+Real parse_real(const char *text, char **end) {
     if constexpr (sizeof(Real) == sizeof(float))
         return strtof(text, end);
     else
         return strtod(text, end);
 }
 template <typename Real>
-lc_status real_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
-    const double value = static_cast<double>(loaded<Real>(attrib));
-    return text_given(row->size == sizeof(float) ? smprintf("%.9f", value) : smprintf("%.18g", value), out);
+lc_status real_to_text(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+    const double value = static_cast<double>(load_value<Real>(attrib));
+    return bn_give_text(row->size == sizeof(float) ? smprintf("%.9f", value) : smprintf("%.18g", value), out);
 }
 template <typename Real>
-lc_status real_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status real_from_text(const bn_type_row *, const char *text, bn_attrib *attrib) {
     char *end = nullptr;
     errno = 0;
-    const Real value = real_of<Real>(text, &end);
+    const Real value = parse_real<Real>(text, &end);
     if (errno || end == text || *end || isspace(static_cast<unsigned char>(*text)))
         return LC_BAD_TYPE;
     memcpy(attrib->value.bytes, &value, sizeof value);
     return LC_OK;
 }
-lc_status char_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
-    return text_given(smprintf("%c", loaded<char>(attrib)), out);
+lc_status char_to_text(const bn_type_row *, const bn_attrib *attrib, char **out) {
+    return bn_give_text(smprintf("%c", load_value<char>(attrib)), out);
 }
-lc_status char_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status char_from_text(const bn_type_row *, const char *text, bn_attrib *attrib) {
     if (strlen(text) != 1)
         return LC_BAD_TYPE;
     attrib->value.bytes[0] = static_cast<uint8_t>(text[0]);
@@ -166,14 +161,14 @@ lc_status char_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
 const lc_enum_entry *names_of(const bn_type_row *row) {
     return row->form ? static_cast<const lc_enum_entry *>(row->form) : bn_type_table;
 }
-lc_status named_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+lc_status named_to_text(const bn_type_row *row, const bn_attrib *attrib, char **out) {
     const auto value = static_cast<int32_t>(bn_value_natural(row, attrib));
-    return text_given(safe_strdup(lc_enum_to_string_quiet(names_of(row), value)), out);
+    return bn_give_text(safe_strdup(lc_enum_to_string_quiet(names_of(row), value)), out);
 }
-lc_status named_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status named_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     int32_t value = 0;
     CHECK_QUIET(lc_string_to_enum(names_of(row), text, &value));
-    store_low(row, static_cast<uint32_t>(value), attrib);
+    store_number(row, static_cast<uint32_t>(value), attrib);
     return LC_OK;
 }
 
@@ -191,21 +186,21 @@ lc_status datetime_to_str(int64_t us, char **out) {
 constexpr int64_t SEC = 1000000, MS = 1000, US = 1;
 // Defines daytime_sec_form, daytime_ms_form and daytime_us_form for example.
 #define TIME_FORMS(kind, to, plain)                                                                          \
-    constexpr time_form kind##_sec_form = {SEC, to, lt_str_to_##kind##_us, plain};                    \
-    constexpr time_form kind##_ms_form = {MS, to, lt_str_to_##kind##_us, plain};                      \
+    constexpr time_form kind##_sec_form = {SEC, to, lt_str_to_##kind##_us, plain};                           \
+    constexpr time_form kind##_ms_form = {MS, to, lt_str_to_##kind##_us, plain};                             \
     constexpr time_form kind##_us_form = {US, to, lt_str_to_##kind##_us, plain};
 TIME_FORMS(daytime, lt_daytime_us_to_str, false)
 TIME_FORMS(datetime, datetime_to_str, false)
 TIME_FORMS(dur, lt_dur_us_to_str, true)
 
-bool is_plain(const time_form *form, const bn_attrib *attrib) {
+bool is_plain_duration(const time_form *form, const bn_attrib *attrib) {
     return form->plain_without_display && !(attrib->type_flags & bn_flag_display);
 }
-lc_status time_out(const bn_type_row *row, const bn_attrib *attrib, char **out) {
+lc_status time_to_text(const bn_type_row *row, const bn_attrib *attrib, char **out) {
     const auto *form = static_cast<const time_form *>(row->form);
     const bool natural = row->shape == value_shape::natural;
-    if (is_plain(form, attrib))
-        return natural ? natural_out(row, attrib, out) : integer_out(row, attrib, out);
+    if (is_plain_duration(form, attrib))
+        return natural ? natural_to_text(row, attrib, out) : integer_to_text(row, attrib, out);
     const int64_t value =
         natural ? static_cast<int64_t>(bn_value_natural(row, attrib)) : bn_value_integer(row, attrib);
     int64_t us = 0;
@@ -213,45 +208,45 @@ lc_status time_out(const bn_type_row *row, const bn_attrib *attrib, char **out) 
     CHECK_STATUS(form->to_str(us, out));
     return LC_OK;
 }
-lc_status time_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status time_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     const auto *form = static_cast<const time_form *>(row->form);
     const bool natural = row->shape == value_shape::natural;
-    if (is_plain(form, attrib))
-        return natural ? natural_in(row, text, attrib) : integer_in(row, text, attrib);
+    if (is_plain_duration(form, attrib))
+        return natural ? natural_from_text(row, text, attrib) : integer_from_text(row, text, attrib);
     int64_t us = 0;
     CHECK_QUIET(form->from_str(text, &us));
     // The limits of the lt_str_to_..._sec and _ms functions, which would log a failure.
     if ((form->unit_us != US && us < 0) || (form->unit_us == SEC && us / SEC > INT32_MAX))
         return LC_BAD_TYPE;
-    store_low(row, static_cast<uint64_t>(us / form->unit_us), attrib);
+    store_number(row, static_cast<uint64_t>(us / form->unit_us), attrib);
     return LC_OK;
 }
-lc_status date_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
-    CHECK_STATUS(lt_date_to_str(loaded<lt_date>(attrib), out));
+lc_status date_to_text(const bn_type_row *, const bn_attrib *attrib, char **out) {
+    CHECK_STATUS(lt_date_to_str(load_value<lt_date>(attrib), out));
     return LC_OK;
 }
-lc_status date_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status date_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     lt_date value = 0;
     CHECK_QUIET(lt_str_to_date(text, &value));
-    store_low(row, value, attrib);
+    store_number(row, value, attrib);
     return LC_OK;
 }
 
 // --- Addresses
 
 template <typename Value, lc_status (*ToStr)(const Value *, char **)>
-lc_status record_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
-    const Value value = loaded<Value>(attrib);
+lc_status record_to_text(const bn_type_row *, const bn_attrib *attrib, char **out) {
+    const Value value = load_value<Value>(attrib);
     CHECK_STATUS(ToStr(&value, out));
     return LC_OK;
 }
 template <typename Value, lc_status (*ToStr)(Value, char **)>
-lc_status word_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
-    CHECK_STATUS(ToStr(loaded<Value>(attrib), out));
+lc_status word_to_text(const bn_type_row *, const bn_attrib *attrib, char **out) {
+    CHECK_STATUS(ToStr(load_value<Value>(attrib), out));
     return LC_OK;
 }
 template <typename Value, lc_status (*FromStr)(const char *, Value *)>
-lc_status record_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status record_from_text(const bn_type_row *, const char *text, bn_attrib *attrib) {
     Value value{};
     CHECK_QUIET(FromStr(text, &value));
     memcpy(attrib->value.bytes, &value, sizeof value);
@@ -260,7 +255,7 @@ lc_status record_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
 lc_status ipv6_to_str(const lc_ipv6addr *value, char **out) {
     char text[INET6_ADDRSTRLEN];
     CHECK_NULL(inet_ntop(AF_INET6, value->bytes, text, sizeof text));
-    return text_given(safe_strdup(text), out);
+    return bn_give_text(safe_strdup(text), out);
 }
 lc_status text_to_ipv6(const char *text, lc_ipv6addr *out) {
     return inet_pton(AF_INET6, text, out->bytes) == 1 ? LC_OK : LC_BAD_TYPE;
@@ -268,7 +263,7 @@ lc_status text_to_ipv6(const char *text, lc_ipv6addr *out) {
 lc_status ipv6prefix_to_str(const lc_ipv6prefix *value, char **out) {
     char text[INET6_ADDRSTRLEN];
     CHECK_NULL(inet_ntop(AF_INET6, value->address, text, sizeof text));
-    return text_given(smprintf("%s/%u", text, value->mask_length), out);
+    return bn_give_text(smprintf("%s/%u", text, value->mask_length), out);
 }
 lc_status text_to_ipv6prefix(const char *text, lc_ipv6prefix *out) {
     lc_ipprefix prefix{};
@@ -281,45 +276,45 @@ lc_status text_to_ipv6prefix(const char *text, lc_ipv6prefix *out) {
 
 // --- Allocated values and none
 
-lc_status none_out(const bn_type_row *, const bn_attrib *, char **out) {
-    return text_given(safe_strdup(""), out);
+lc_status none_to_text(const bn_type_row *, const bn_attrib *, char **out) {
+    return bn_give_text(safe_strdup(""), out);
 }
-lc_status none_in(const bn_type_row *, const char *, bn_attrib *) {
+lc_status none_from_text(const bn_type_row *, const char *, bn_attrib *) {
     return LC_OK;
 }
-lc_status refuse_out(const bn_type_row *, const bn_attrib *, char **) {
+lc_status refuse_to_text(const bn_type_row *, const bn_attrib *, char **) {
     FAIL_WITH(LC_UNEXPECTED_CASE);
 }
-lc_status refuse_in(const bn_type_row *, const char *, bn_attrib *) {
+lc_status refuse_from_text(const bn_type_row *, const char *, bn_attrib *) {
     FAIL_WITH(LC_UNEXPECTED_CASE);
 }
-lc_status string_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
-    return text_given(safe_strdup(attrib->value.string ? attrib->value.string->buffer : ""), out);
+lc_status string_to_text(const bn_type_row *, const bn_attrib *attrib, char **out) {
+    return bn_give_text(safe_strdup(attrib->value.string ? attrib->value.string->buffer : ""), out);
 }
-lc_status string_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status string_from_text(const bn_type_row *, const char *text, bn_attrib *attrib) {
     CHECK_STATUS(ts_new_str(&attrib->value.string, text));
     attrib->value_size = static_cast<uint32_t>(ts_length(attrib->value.string));
     return LC_OK;
 }
-lc_status utf8_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
-    CHECK_STATUS(string_in(row, text, attrib));
+lc_status utf8_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+    CHECK_STATUS(string_from_text(row, text, attrib));
     const lc_status status = ts_set_utf8(attrib->value.string, 1);
     return status == LC_BAD_UTF8 ? LC_BAD_TYPE : status;
 }
-lc_status hostname_in(const bn_type_row *row, const char *text, bn_attrib *attrib) {
+lc_status hostname_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     if (text[0] == '-')
         return LC_BAD_TYPE;
     for (const char *at = text; *at; at++) // ASCII only; isalnum() depends on the locale
         if (!((*at | 0x20) >= 'a' && (*at | 0x20) <= 'z') && !(*at >= '0' && *at <= '9') && *at != '-' &&
             *at != '.')
             return LC_BAD_TYPE;
-    return string_in(row, text, attrib);
+    return string_from_text(row, text, attrib);
 }
-lc_status binary_out(const bn_type_row *, const bn_attrib *attrib, char **out) {
+lc_status binary_to_text(const bn_type_row *, const bn_attrib *attrib, char **out) {
     const tbuffer *bytes = attrib->value.binary;
-    return text_given(safe_strdup(bytes ? reinterpret_cast<const char *>(bytes->buffer) : ""), out);
+    return bn_give_text(safe_strdup(bytes ? reinterpret_cast<const char *>(bytes->buffer) : ""), out);
 }
-lc_status binary_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
+lc_status binary_from_text(const bn_type_row *, const char *text, bn_attrib *attrib) {
     CHECK_STATUS(tb_new_buf(&attrib->value.binary, text, -1));
     attrib->value_size = static_cast<uint32_t>(tb_length(attrib->value.binary));
     return LC_OK;
@@ -329,68 +324,85 @@ lc_status binary_in(const bn_type_row *, const char *text, bn_attrib *attrib) {
 
 using shape = value_shape;
 constexpr bn_type_row rows[] = {
-    {bn_type_uint8, "uint8", 1, shape::natural, true, natural_out, natural_in, wire_number, nullptr},
-    {bn_type_int8, "int8", 1, shape::integer, true, integer_out, integer_in, wire_number, nullptr},
-    {bn_type_uint16, "uint16", 2, shape::natural, true, natural_out, natural_in, wire_number, nullptr},
-    {bn_type_int16, "int16", 2, shape::integer, true, integer_out, integer_in, wire_number, nullptr},
-    {bn_type_uint32, "uint32", 4, shape::natural, true, natural_out, natural_in, wire_number, nullptr},
-    {bn_type_int32, "int32", 4, shape::integer, true, integer_out, integer_in, wire_number, nullptr},
-    {bn_type_uint64, "uint64", 8, shape::natural, true, natural_out, natural_in, wire_number, nullptr},
-    {bn_type_int64, "int64", 8, shape::integer, true, integer_out, integer_in, wire_number, nullptr},
-    {bn_type_bool, "bool", 4, shape::natural, false, bool_out, bool_in, wire_number, nullptr},
-    {bn_type_float32, "float32", 4, shape::real, true, real_out<float>, real_in<float>, wire_number, nullptr},
-    {bn_type_float64, "float64", 8, shape::real, true, real_out<double>, real_in<double>, wire_number,
+    {bn_type_uint8, "uint8", 1, shape::natural, true, natural_to_text, natural_from_text, wire_number,
      nullptr},
-    {bn_type_char, "char", 1, shape::natural, false, char_out, char_in, wire_number, nullptr},
+    {bn_type_int8, "int8", 1, shape::integer, true, integer_to_text, integer_from_text, wire_number, nullptr},
+    {bn_type_uint16, "uint16", 2, shape::natural, true, natural_to_text, natural_from_text, wire_number,
+     nullptr},
+    {bn_type_int16, "int16", 2, shape::integer, true, integer_to_text, integer_from_text, wire_number,
+     nullptr},
+    {bn_type_uint32, "uint32", 4, shape::natural, true, natural_to_text, natural_from_text, wire_number,
+     nullptr},
+    {bn_type_int32, "int32", 4, shape::integer, true, integer_to_text, integer_from_text, wire_number,
+     nullptr},
+    {bn_type_uint64, "uint64", 8, shape::natural, true, natural_to_text, natural_from_text, wire_number,
+     nullptr},
+    {bn_type_int64, "int64", 8, shape::integer, true, integer_to_text, integer_from_text, wire_number,
+     nullptr},
+    {bn_type_bool, "bool", 4, shape::natural, false, bool_to_text, bool_from_text, wire_number, nullptr},
+    {bn_type_float32, "float32", 4, shape::real, true, real_to_text<float>, real_from_text<float>,
+     wire_number, nullptr},
+    {bn_type_float64, "float64", 8, shape::real, true, real_to_text<double>, real_from_text<double>,
+     wire_number, nullptr},
+    {bn_type_char, "char", 1, shape::natural, false, char_to_text, char_from_text, wire_number, nullptr},
     {bn_type_ipaddr, "ipaddr", sizeof(lc_ipaddr), shape::ipaddr, false,
-     record_out<lc_ipaddr, lc_ipaddr_to_str>, record_in<lc_ipaddr, bn_text_to_ipaddr>, wire_ipaddr, nullptr},
-    {bn_type_ipprefix, "ipprefix", sizeof(lc_ipprefix), shape::ipprefix, false,
-     record_out<lc_ipprefix, lc_ipprefix_to_str>, record_in<lc_ipprefix, bn_text_to_ipprefix>, wire_ipprefix,
+     record_to_text<lc_ipaddr, lc_ipaddr_to_str>, record_from_text<lc_ipaddr, bn_text_to_ipaddr>, wire_ipaddr,
      nullptr},
-    {bn_type_ipv4addr, "ipv4addr", 4, shape::natural, false, word_out<uint32_t, lc_ipv4addr_to_str>,
-     record_in<uint32_t, lc_str_to_ipv4addr>, wire_number, nullptr},
-    {bn_type_ipv4prefix, "ipv4prefix", 8, shape::natural, false, word_out<uint64_t, lc_ipv4prefix_to_str>,
-     record_in<uint64_t, lc_str_to_ipv4prefix>, wire_number, nullptr},
+    {bn_type_ipprefix, "ipprefix", sizeof(lc_ipprefix), shape::ipprefix, false,
+     record_to_text<lc_ipprefix, lc_ipprefix_to_str>, record_from_text<lc_ipprefix, bn_text_to_ipprefix>,
+     wire_ipprefix, nullptr},
+    {bn_type_ipv4addr, "ipv4addr", 4, shape::natural, false, word_to_text<uint32_t, lc_ipv4addr_to_str>,
+     record_from_text<uint32_t, lc_str_to_ipv4addr>, wire_number, nullptr},
+    {bn_type_ipv4prefix, "ipv4prefix", 8, shape::natural, false, word_to_text<uint64_t, lc_ipv4prefix_to_str>,
+     record_from_text<uint64_t, lc_str_to_ipv4prefix>, wire_number, nullptr},
     {bn_type_macaddr802, "macaddr802", 6, shape::bytes, false,
-     record_out<lc_macaddr802, lc_macaddr802_to_str>, record_in<lc_macaddr802, lc_str_to_macaddr802>,
-     wire_bytes, nullptr},
-    {bn_type_ipv6addr, "ipv6addr", 16, shape::bytes, false, record_out<lc_ipv6addr, ipv6_to_str>,
-     record_in<lc_ipv6addr, text_to_ipv6>, wire_number, nullptr},
-    {bn_type_ipv6prefix, "ipv6prefix", 17, shape::bytes, false, record_out<lc_ipv6prefix, ipv6prefix_to_str>,
-     record_in<lc_ipv6prefix, text_to_ipv6prefix>, wire_number, nullptr},
-    {bn_type_date, "date", 4, shape::natural, false, date_out, date_in, wire_number, nullptr},
-    {bn_type_time_sec, "time_sec", 4, shape::natural, false, time_out, time_in, wire_number,
+     record_to_text<lc_macaddr802, lc_macaddr802_to_str>,
+     record_from_text<lc_macaddr802, lc_str_to_macaddr802>, wire_bytes, nullptr},
+    {bn_type_ipv6addr, "ipv6addr", 16, shape::bytes, false, record_to_text<lc_ipv6addr, ipv6_to_str>,
+     record_from_text<lc_ipv6addr, text_to_ipv6>, wire_number, nullptr},
+    {bn_type_ipv6prefix, "ipv6prefix", 17, shape::bytes, false,
+     record_to_text<lc_ipv6prefix, ipv6prefix_to_str>, record_from_text<lc_ipv6prefix, text_to_ipv6prefix>,
+     wire_number, nullptr},
+    {bn_type_date, "date", 4, shape::natural, false, date_to_text, date_from_text, wire_number, nullptr},
+    {bn_type_time_sec, "time_sec", 4, shape::natural, false, time_to_text, time_from_text, wire_number,
      &daytime_sec_form},
-    {bn_type_time_ms, "time_ms", 8, shape::integer, false, time_out, time_in, wire_number, &daytime_ms_form},
-    {bn_type_time_us, "time_us", 8, shape::integer, false, time_out, time_in, wire_number, &daytime_us_form},
-    {bn_type_datetime_sec, "datetime_sec", 4, shape::natural, false, time_out, time_in, wire_number,
-     &datetime_sec_form},
-    {bn_type_datetime_ms, "datetime_ms", 8, shape::integer, false, time_out, time_in, wire_number,
+    {bn_type_time_ms, "time_ms", 8, shape::integer, false, time_to_text, time_from_text, wire_number,
+     &daytime_ms_form},
+    {bn_type_time_us, "time_us", 8, shape::integer, false, time_to_text, time_from_text, wire_number,
+     &daytime_us_form},
+    {bn_type_datetime_sec, "datetime_sec", 4, shape::natural, false, time_to_text, time_from_text,
+     wire_number, &datetime_sec_form},
+    {bn_type_datetime_ms, "datetime_ms", 8, shape::integer, false, time_to_text, time_from_text, wire_number,
      &datetime_ms_form},
-    {bn_type_datetime_us, "datetime_us", 8, shape::integer, false, time_out, time_in, wire_number,
+    {bn_type_datetime_us, "datetime_us", 8, shape::integer, false, time_to_text, time_from_text, wire_number,
      &datetime_us_form},
-    {bn_type_duration_sec, "duration_sec", 4, shape::natural, true, time_out, time_in, wire_number,
+    {bn_type_duration_sec, "duration_sec", 4, shape::natural, true, time_to_text, time_from_text, wire_number,
      &dur_sec_form},
-    {bn_type_duration_ms, "duration_ms", 8, shape::integer, true, time_out, time_in, wire_number,
+    {bn_type_duration_ms, "duration_ms", 8, shape::integer, true, time_to_text, time_from_text, wire_number,
      &dur_ms_form},
-    {bn_type_duration_us, "duration_us", 8, shape::integer, true, time_out, time_in, wire_number,
+    {bn_type_duration_us, "duration_us", 8, shape::integer, true, time_to_text, time_from_text, wire_number,
      &dur_us_form},
-    {bn_type_none, "none", 0, shape::none, false, none_out, none_in, wire_number, nullptr},
-    {bn_type_any, "any", 0, shape::none, false, refuse_out, refuse_in, {}, nullptr},
-    {bn_type_btype, "btype", 4, shape::natural, false, named_out, named_in, wire_number, nullptr},
-    {bn_type_attribute, "attribute", 4, shape::natural, false, named_out, named_in, wire_number,
+    {bn_type_none, "none", 0, shape::none, false, none_to_text, none_from_text, wire_number, nullptr},
+    {bn_type_any, "any", 0, shape::none, false, refuse_to_text, refuse_from_text, {}, nullptr},
+    {bn_type_btype, "btype", 4, shape::natural, false, named_to_text, named_from_text, wire_number, nullptr},
+    {bn_type_attribute, "attribute", 4, shape::natural, false, named_to_text, named_from_text, wire_number,
      bn_attribute_id_table},
-    {bn_type_str, "string", 0, shape::text, false, string_out, string_in, wire_counted, nullptr},
-    {bn_type_utf8_string, "utf8_string", 0, shape::text, false, string_out, utf8_in, wire_counted, nullptr},
-    {bn_type_binary, "binary", 0, shape::binary, false, binary_out, binary_in, wire_counted, nullptr},
-    {bn_type_oid, "oid", 0, shape::text, false, string_out, string_in, wire_counted, nullptr},
-    {bn_type_link, "link", 0, shape::text, false, string_out, string_in, wire_counted, nullptr},
-    {bn_type_name, "name", 0, shape::text, false, string_out, string_in, wire_counted, nullptr},
-    {bn_type_hostname, "hostname", 0, shape::text, false, string_out, hostname_in, wire_counted, nullptr},
-    {bn_type_uri, "uri", 0, shape::text, false, string_out, string_in, wire_counted, nullptr},
-    {bn_type_charlist, "charlist", 0, shape::text, false, string_out, string_in, wire_counted, nullptr},
-    {bn_type_regex, "regex", 0, shape::text, false, string_out, string_in, wire_counted, nullptr},
-    {bn_type_globpattern, "globpattern", 0, shape::text, false, string_out, string_in, wire_counted, nullptr},
+    {bn_type_str, "string", 0, shape::text, false, string_to_text, string_from_text, wire_counted, nullptr},
+    {bn_type_utf8_string, "utf8_string", 0, shape::text, false, string_to_text, utf8_from_text, wire_counted,
+     nullptr},
+    {bn_type_binary, "binary", 0, shape::binary, false, binary_to_text, binary_from_text, wire_counted,
+     nullptr},
+    {bn_type_oid, "oid", 0, shape::text, false, string_to_text, string_from_text, wire_counted, nullptr},
+    {bn_type_link, "link", 0, shape::text, false, string_to_text, string_from_text, wire_counted, nullptr},
+    {bn_type_name, "name", 0, shape::text, false, string_to_text, string_from_text, wire_counted, nullptr},
+    {bn_type_hostname, "hostname", 0, shape::text, false, string_to_text, hostname_from_text, wire_counted,
+     nullptr},
+    {bn_type_uri, "uri", 0, shape::text, false, string_to_text, string_from_text, wire_counted, nullptr},
+    {bn_type_charlist, "charlist", 0, shape::text, false, string_to_text, string_from_text, wire_counted,
+     nullptr},
+    {bn_type_regex, "regex", 0, shape::text, false, string_to_text, string_from_text, wire_counted, nullptr},
+    {bn_type_globpattern, "globpattern", 0, shape::text, false, string_to_text, string_from_text,
+     wire_counted, nullptr},
 };
 constexpr size_t ROW_COUNT = sizeof rows / sizeof rows[0];
 
@@ -400,7 +412,7 @@ struct derived_tables {
     bn_attrib_copy_func wire[BN_TYPE_LAST + 1];
     const bn_type_row *by_number[BN_TYPE_LAST + 1];
 };
-constexpr derived_tables derive() {
+constexpr derived_tables derive_tables() {
     derived_tables tables{};
     for (size_t i = 0; i < ROW_COUNT; i++) {
         tables.names[i] = {static_cast<int32_t>(rows[i].number), rows[i].name};
@@ -410,7 +422,7 @@ constexpr derived_tables derive() {
     }
     return tables;
 }
-constexpr derived_tables tables = derive();
+constexpr derived_tables tables = derive_tables();
 
 } // namespace
 
@@ -455,14 +467,14 @@ uint32_t bn_type_fixed_size(uint32_t type_and_flags) {
 namespace {
 
 template <typename Number>
-int order(Number a, Number b) {
+int compare_ordered(Number a, Number b) {
     return (a > b) - (a < b);
 }
 int compare_binary(const tbuffer *a, const tbuffer *b) {
     if (!a || !b)
         return (a ? 0 : 1) - (b ? 0 : 1);
     const int result = memcmp(a->buffer, b->buffer, std::min(a->length, b->length));
-    return result ? result : order(a->length, b->length);
+    return result ? result : compare_ordered(a->length, b->length);
 }
 
 } // namespace
@@ -472,20 +484,20 @@ int bn_value_compare(const bn_type_row *row, const bn_attrib *a, const bn_attrib
     case value_shape::none:
         return 0;
     case value_shape::natural:
-        return order(bn_value_natural(row, a), bn_value_natural(row, b));
+        return compare_ordered(bn_value_natural(row, a), bn_value_natural(row, b));
     case value_shape::integer:
-        return order(bn_value_integer(row, a), bn_value_integer(row, b));
+        return compare_ordered(bn_value_integer(row, a), bn_value_integer(row, b));
     case value_shape::real:
-        return row->size == sizeof(float) ? order(loaded<float>(a), loaded<float>(b))
-                                          : order(loaded<double>(a), loaded<double>(b));
+        return row->size == sizeof(float) ? compare_ordered(load_value<float>(a), load_value<float>(b))
+                                          : compare_ordered(load_value<double>(a), load_value<double>(b));
     case value_shape::bytes:
         return memcmp(a->value.bytes, b->value.bytes, row->size);
     case value_shape::ipaddr: {
-        const lc_ipaddr left = loaded<lc_ipaddr>(a), right = loaded<lc_ipaddr>(b);
+        const lc_ipaddr left = load_value<lc_ipaddr>(a), right = load_value<lc_ipaddr>(b);
         return lc_ipaddr_compare(&left, &right);
     }
     case value_shape::ipprefix: {
-        const lc_ipprefix left = loaded<lc_ipprefix>(a), right = loaded<lc_ipprefix>(b);
+        const lc_ipprefix left = load_value<lc_ipprefix>(a), right = load_value<lc_ipprefix>(b);
         return lc_ipprefix_compare(&left, &right);
     }
     case value_shape::text:

@@ -20,7 +20,7 @@ lc_status mgmt_client_init(mgmt_client *client, fdic_handler close_handler) {
 namespace {
 
 // LC_IO_ERROR and LC_IO_CLOSED mean that mgmtd isn't running, which the caller logs.
-lc_status connect_quietly(gcl_session *session) {
+lc_status connect_to_mgmtd(gcl_session *session) {
     const lc_status status = gcl_session_client_connect_by_provider(session, "mgmtd", 1);
     if (status == LC_IO_ERROR || status == LC_IO_CLOSED)
         CHECK_QUIET(status);
@@ -32,7 +32,7 @@ lc_status connect_quietly(gcl_session *session) {
 
 lc_status mgmt_client_open(mgmt_client *client, const char *client_name, mdc_send_function msg_handler) {
     CHECK_STATUS(gcl_session_client_new(*client->instance, client_name, nullptr, 0, client->session));
-    CHECK_QUIET(connect_quietly(*client->session));
+    CHECK_QUIET(connect_to_mgmtd(*client->session));
     CHECK_STATUS(gcl_session_client_open_service_blocking(*client->session, 2, 2, nullptr, 0, -1));
     CHECK_STATUS(mdc_init(msg_handler, nullptr, nullptr, nullptr, *client->session, client->handle));
     return LC_OK;

@@ -74,7 +74,7 @@ void ignore_sigpipe() {
     sigaction(SIGPIPE, &action, nullptr);
 }
 
-lc_status init_steps(gcl *instance) {
+lc_status set_up_instance(gcl *instance) {
     CHECK_CONDITION(lc_lock_init(&instance->lock, 1) == 0);
     ignore_sigpipe();
     CHECK_STATUS(gcl_admin_register(instance));
@@ -96,7 +96,7 @@ lc_status gcl_init(gcl **out, const gcl_options *options, fdic *interests) {
         (void)gcl_options_get_defaults(&instance->options);
     instance->interests = interests;
     instance->next_session_id = 1;
-    const lc_status status = init_steps(instance);
+    const lc_status status = set_up_instance(instance);
     if (status != LC_OK)
         (void)gcl_deinit(&instance);
     CHECK_STATUS(status);

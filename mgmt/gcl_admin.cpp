@@ -19,18 +19,18 @@
 namespace {
 
 template <size_t Size>
-void put_text(char (&field)[Size], const char *text) {
+void fill_text_field(char (&field)[Size], const char *text) {
     memset(field, 0, Size);
     memcpy(field, text, strnlen(text, Size - 1));
 }
-void take_text(char (&text)[33], const char (&field)[32]) {
+void copy_text_field(char (&text)[33], const char (&field)[32]) {
     memcpy(text, field, sizeof field);
     text[sizeof field] = 0;
 }
 
 // Copies the body of a frame. LC_ASSERTION if it is shorter than the layout.
 template <typename Layout>
-lc_status body_of(const tbuffer *frame, Layout *out) {
+lc_status copy_body(const tbuffer *frame, Layout *out) {
     CHECK_CONDITION(tb_length(frame) >= static_cast<int32_t>(GCL_HEADER_BYTES + sizeof(Layout)));
     memcpy(out, tb_buf(frame) + GCL_HEADER_BYTES, sizeof(Layout));
     return LC_OK;
@@ -71,12 +71,13 @@ lc_status send_greeting_response(gcl_session *session, const gcl_admin *admin) {
     gcl *instance = session->instance;
     gcl_wire_greeting_response body{};
     body.version = to_be16(GCL_ADMIN_VERSION);
+    // The counter continues over all sessions of the instance.
     body.message_id = to_be32(instance->admin_message_id++);
     body.second_counter = to_be32(instance->admin_second_counter++);
-    put_text(body.name, session->local_name);
+    fill_text_field(body.name, session->local_name);
     body.uid = to_be32(static_cast<uint32_t>(admin->uid));
     body.gid = to_be32(static_cast<uint32_t>(admin->gid));
-    put_text(body.user, admin->user);
+    fill_text_field(body.user, admin->user);
     body.flags = to_be32(admin->flags);
     CHECK_STATUS(gcl_session_send_frame_components(session, GCL_PROTO_ADMIN, GCL_ADMIN_GREETING_RESPONSE,
                                                    sizeof body, &body));
@@ -153,7 +154,7 @@ lc_status receive_greeting(gcl_session *session, gcl_body_protocol *, tbuffer **
     const gcl_owned_buffer taken(*frame);
     *frame = nullptr;
     gcl_wire_greeting body{};
-    CHECK_STATUS(body_of(taken.pointer, &body));
+    CHECK_STATUS(copy_body(taken.pointer, &body));
     gcl_admin *admin = gcl_admin_of(session);
     CHECK_NULL(admin);
     if (to_host(body.version) != GCL_ADMIN_VERSION) {
@@ -180,8 +181,8 @@ lc_status receive_greeting(gcl_session *session, gcl_body_protocol *, tbuffer **
     admin->peer_uid = uid;
     admin->peer_gid = gid;
     admin->peer_flags = to_host(body.flags);
-    take_text(admin->peer_user, body.user);
-    take_text(admin->peer_name, body.name);
+    copy_text_field(admin->peer_user, body.user);
+    copy_text_field(admin->peer_name, body.name);
     admin->authenticated = 1;
     LC_LOG(LC_LOG_INFO, "session %d: client open for peer %s", session->id, admin->peer_name);
     return LC_OK;
@@ -208,7 +209,8 @@ lc_status gcl_session_client_open_service(gcl_session *session, uint16_t protoco
     body.protocol = to_be32(protocol);
     body.service = to_be32(static_cast<uint32_t>(service));
     if (name)
-        put_text(body.name, name);
+        fill_text_field(body.name, name);
+    // Set before sending, which may close the session.
     admin->state = GCL_ADMIN_OPEN_SENT;
     admin->pending_service = service;
     CHECK_STATUS(gcl_session_send_frame_components(session, GCL_PROTO_ADMIN, GCL_ADMIN_OPEN_SERVICE,
@@ -224,7 +226,7 @@ lc_status receive_open_response(gcl_session *session, gcl_body_protocol *, tbuff
     const gcl_owned_buffer taken(*frame);
     *frame = nullptr;
     gcl_wire_open_service_response body{};
-    CHECK_STATUS(body_of(taken.pointer, &body));
+    CHECK_STATUS(copy_body(taken.pointer, &body));
     gcl_admin *admin = gcl_admin_of(session);
     CHECK_NULL(admin);
     const auto status = static_cast<int32_t>(to_host(body.status));
@@ -235,14 +237,14 @@ lc_status receive_open_response(gcl_session *session, gcl_body_protocol *, tbuff
         admin->current_service = pending;
         admin->open_services |= 1u << pending;
         admin->state = GCL_ADMIN_OPEN_ANSWERED;
-        take_text(admin->peer_service_name, body.peer_name);
+        copy_text_field(admin->peer_service_name, body.peer_name);
     } else {
         admin->state = admin->open_services ? GCL_ADMIN_GREETED : GCL_ADMIN_OPEN_ANSWERED;
     }
     return LC_OK;
 }
 
-lc_status receive_other(gcl_session *session, gcl_body_protocol *, tbuffer **frame, void *) {
+lc_status ignore_message(gcl_session *session, gcl_body_protocol *, tbuffer **frame, void *) {
     LC_LOG(LC_LOG_DEBUG, "session %d: proto admin: in receive CATCHALL", session->id);
     tb_free(frame);
     return LC_OK;
@@ -264,10 +266,10 @@ lc_status gcl_admin_register(gcl *instance) {
         uint16_t mtype;
         gcl_frame_handler function;
     } handlers[] = {
-        {0, receive_other},
+        {0, ignore_message},
         {GCL_ADMIN_GREETING, receive_greeting},
-        {GCL_ADMIN_GREETING_RESPONSE, receive_other},
-        {GCL_ADMIN_OPEN_SERVICE, receive_other},
+        {GCL_ADMIN_GREETING_RESPONSE, ignore_message},
+        {GCL_ADMIN_OPEN_SERVICE, ignore_message},
         {GCL_ADMIN_OPEN_SERVICE_RESPONSE, receive_open_response},
     };
     for (const auto &row : handlers)

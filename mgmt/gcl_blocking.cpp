@@ -51,7 +51,7 @@ void free_polled(pollfd *polled) {
     free(polled);
 }
 
-watched_state look(const blocking_wait *wait) {
+watched_state read_watched_state(const blocking_wait *wait) {
     watched_state seen{wait->session->counters.frames_sent, wait->session->counters.frames_received,
                        wait->session->state, 0};
     gcl_body_protocol *protocol = gcl_get_body_protocol(wait->instance, wait->protocol);
@@ -60,8 +60,8 @@ watched_state look(const blocking_wait *wait) {
     return seen;
 }
 
-bool changed(const blocking_wait *wait, const watched_state *before) {
-    const watched_state now = look(wait);
+bool has_changed(const blocking_wait *wait, const watched_state *before) {
+    const watched_state now = read_watched_state(wait);
     const bool differs = (wait->on_sent && now.frames_sent != before->frames_sent) ||
                          (wait->on_received && now.frames_received != before->frames_received) ||
                          (wait->on_session_state && now.session_state != before->session_state) ||
@@ -88,7 +88,7 @@ bool gcl_end_is_pending(const gcl *instance) {
 namespace {
 
 // The time left in milliseconds; -1 without a limit, -2 if there is none left.
-int64_t time_left(blocking_wait *wait) {
+int64_t time_until_timeout(blocking_wait *wait) {
     if (wait->timeout_ms < 0)
         return -1;
     const int64_t now = lt_curr_time_ms();
@@ -109,7 +109,7 @@ void forget_deleted_timers(blocking_wait *wait, const fdic_event_array *events) 
 }
 
 // The record of a timer, which is made when the timer is first seen, and runs from then on.
-lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t now, seen_timer **out) {
+lc_status track_timer(blocking_wait *wait, const fdic_event *event, int64_t now, seen_timer **out) {
     uint32_t at = 0;
     while (at < wait->timer_count && wait->timers[at].id != event->id)
         at++;
@@ -121,6 +121,7 @@ lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t now, s
         wait->timers[wait->timer_count++] = {event->id, -1, 0, false};
     }
     seen_timer *timer = &wait->timers[at];
+    // A delay near the end of the range must not overflow.
     if (timer->delay != event->delay)
         *timer = {event->id, event->delay, now + std::min(event->delay, INT64_MAX - now), false};
     *out = timer;
@@ -128,7 +129,7 @@ lc_status see_timer(blocking_wait *wait, const fdic_event *event, int64_t now, s
 }
 
 // Calls the timers that are due, each once. `out_next`: milliseconds to the next one, -1 if there is none.
-lc_status run_timers(blocking_wait *wait, const fdic_event_array *events, int64_t *out_next) {
+lc_status run_due_timers(blocking_wait *wait, const fdic_event_array *events, int64_t *out_next) {
     const int64_t now = lt_monotonic_ms();
     *out_next = -1;
     forget_deleted_timers(wait, events);
@@ -137,7 +138,7 @@ lc_status run_timers(blocking_wait *wait, const fdic_event_array *events, int64_
         if (!event->has_timer || event->delay < 0)
             continue;
         seen_timer *timer = nullptr;
-        CHECK_STATUS(see_timer(wait, event, now, &timer));
+        CHECK_STATUS(track_timer(wait, event, now, &timer));
         if (timer->called)
             continue;
         if (timer->due_ms > now) {
@@ -156,6 +157,8 @@ lc_status run_timers(blocking_wait *wait, const fdic_event_array *events, int64_
 lc_status fill_polled(const fdic_event_array *events, pollfd *polled) {
     for (uint32_t i = 0; i < fdic_event_array_length_quick(events); i++) {
         const fdic_event *event = fdic_event_array_get_quick(events, i);
+        // poll() ignores a negative descriptor. Every interest has an entry, so that the indexes of both
+        // arrays agree.
         polled[i] = {-1, 0, 0};
         if (!event->has_fd || (!event->want_read && !event->want_write))
             continue;
@@ -184,19 +187,19 @@ lc_status run_ready(const blocking_wait *wait, const fdic_event_array *events, c
             CHECK_STATUS(
                 event->read_function(event->fd, FDIC_READABLE, event->user_data, event->read_argument));
         if (readable && event->user_data == wait->session)
-            *out_stop = changed(wait, before);
+            *out_stop = has_changed(wait, before);
         if (*out_stop)
             return LC_OK;
         if (writable && event->want_write && event->write_function)
             CHECK_STATUS(
                 event->write_function(event->fd, FDIC_WRITABLE, event->user_data, event->write_argument));
         if (writable && event->user_data == wait->session)
-            *out_stop = changed(wait, before);
+            *out_stop = has_changed(wait, before);
     }
     return LC_OK;
 }
 
-lc_status wait_round(blocking_wait *wait, bool *out_stop) {
+lc_status wait_one_round(blocking_wait *wait, bool *out_stop) {
     if (wait->session->state == GCL_SESSION_CLOSED || wait->session->fd < 0)
         return LC_IO_CLOSED;
     if (gcl_end_is_pending(wait->instance))
@@ -204,14 +207,14 @@ lc_status wait_round(blocking_wait *wait, bool *out_stop) {
     owned<fdic_event_array, fdic_event_array_release> events;
     CHECK_STATUS(fdic_events_query(wait->instance->interests, &events.pointer));
     // Before the timers are called, which may cause the change that is waited for.
-    const watched_state before = look(wait);
+    const watched_state before = read_watched_state(wait);
     int64_t next_timer = -1;
-    CHECK_STATUS(run_timers(wait, events.pointer, &next_timer));
+    CHECK_STATUS(run_due_timers(wait, events.pointer, &next_timer));
     const uint32_t count = fdic_event_array_length_quick(events.pointer);
     owned<pollfd, free_polled> polled(static_cast<pollfd *>(calloc(count + 1, sizeof(pollfd))));
     CHECK_NULL(polled.pointer);
     CHECK_QUIET(fill_polled(events.pointer, polled.pointer));
-    const int64_t left = time_left(wait);
+    const int64_t left = time_until_timeout(wait);
     if (left < -1)
         return LC_IO_TIMED_OUT;
     // Waits at most until the next timer, or until it is time to check again whether the process is ending.
@@ -252,7 +255,7 @@ lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int st
     bool stop = false;
     lc_status status = LC_OK;
     while (!stop && status == LC_OK)
-        status = wait_round(&wait, &stop);
+        status = wait_one_round(&wait, &stop);
     free(wait.timers);
     CHECK_QUIET(status);
     return LC_OK;

@@ -29,12 +29,12 @@ constexpr int64_t RATE_SLICE_MS = 100;
 
 namespace {
 
-void swap16(uint8_t *at) {
+void swap_u16(uint8_t *at) {
     const uint8_t first = at[0];
     at[0] = at[1];
     at[1] = first;
 }
-void swap32(uint8_t *at) {
+void swap_u32(uint8_t *at) {
     const uint8_t first = at[0], second = at[1];
     at[0] = at[3];
     at[1] = at[2];
@@ -50,9 +50,9 @@ void gcl_byte_swap_frame_header(void *header) {
         return;
     // The ident is a string and keeps its order.
     for (const uint32_t offset : {4u, 8u, 12u, 20u, 28u})
-        swap32(bytes + offset);
+        swap_u32(bytes + offset);
     for (const uint32_t offset : {16u, 18u, 24u, 26u})
-        swap16(bytes + offset);
+        swap_u16(bytes + offset);
 }
 
 // --- Sending
@@ -92,7 +92,7 @@ lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue_max) {
     return LC_CANCELLED;
 }
 
-void note_drained(gcl_session *session) {
+void report_drained(gcl_session *session) {
     // At half of the limit, so that a queue which stays nearly full doesn't log a pair of lines per frame.
     if (!session->frames_lost || session->queued_bytes > GCL_QUEUE_MAX_BYTES / 2)
         return;
@@ -101,7 +101,7 @@ void note_drained(gcl_session *session) {
     session->frames_lost = 0;
 }
 
-lc_status queue_frame(gcl_session *session, tbuffer **inout_buffer, uint32_t sequence) {
+lc_status append_to_queue(gcl_session *session, tbuffer **inout_buffer, uint32_t sequence) {
     auto *frame = static_cast<gcl_frame *>(calloc(1, sizeof(gcl_frame)));
     CHECK_NULL(frame);
     const lc_status status = tb_detach(inout_buffer, &frame->bytes, &frame->length);
@@ -125,7 +125,7 @@ lc_status send_buffer(gcl_session *session, uint16_t proto, uint16_t mtype, tbuf
     const auto total = static_cast<uint32_t>(tb_length(*inout_buffer));
     const uint32_t sequence = session->sequence++;
     fill_header(tb_buf(*inout_buffer), sequence, proto, mtype, total);
-    CHECK_STATUS(queue_frame(session, inout_buffer, sequence));
+    CHECK_STATUS(append_to_queue(session, inout_buffer, sequence));
     return LC_OK;
 }
 
@@ -228,6 +228,7 @@ lc_status write_queue(gcl_session *session, bool *out_blocked) {
     while (gcl_frame *frame = session->queue_head) {
         if (!slice)
             return wait_for_slice(session);
+        // After a partial write the loop gets here again and finds the socket full.
         if (!lf_is_writable(session->fd)) {
             LC_LOG(LC_LOG_DEBUG, "session %d: not writable: %d", session->id, session->fd);
             *out_blocked = true;
@@ -241,6 +242,7 @@ lc_status write_queue(gcl_session *session, bool *out_blocked) {
         frame->written += written;
         session->queued_bytes -= written;
         session->counters.bytes_sent += written;
+        // The slice is used up only under a rate limit; otherwise it stays without a limit.
         if (session->rate_limit)
             slice -= written;
         if (status == LC_IO_CLOSED) {
@@ -268,7 +270,8 @@ lc_status gcl_run_output_queue(gcl_session *session) {
         LOG_STATUS(gcl_session_close(session, 0));
         return status == LC_IO_CLOSED ? LC_OK : status;
     }
-    note_drained(session);
+    report_drained(session);
+    // The interest in writing lasts only while the socket is full, or the loop would be woken all the time.
     if (blocked != (session->want_write != 0)) {
         session->want_write = blocked;
         CHECK_STATUS(
@@ -305,13 +308,13 @@ lc_status check_header(const gcl_session *session, const gcl_frame_header *heade
     return LC_OK;
 }
 
-const gcl_message_handler *handler_of(const gcl_body_protocol *protocol, uint16_t mtype) {
+const gcl_message_handler *find_handler(const gcl_body_protocol *protocol, uint16_t mtype) {
     if (mtype < GCL_HANDLERS_MAX && protocol->handlers[mtype].function)
         return &protocol->handlers[mtype];
     return protocol->handlers[0].function ? &protocol->handlers[0] : nullptr;
 }
 
-lc_status hand_over(gcl_session *session, tbuffer **inout_frame) {
+lc_status deliver_frame(gcl_session *session, tbuffer **inout_frame) {
     const auto length = static_cast<uint32_t>(tb_length(*inout_frame));
     gcl_byte_swap_frame_header(tb_buf(*inout_frame));
     gcl_frame_header header;
@@ -325,13 +328,14 @@ lc_status hand_over(gcl_session *session, tbuffer **inout_frame) {
                length, header.proto);
         return LC_OK;
     }
-    const gcl_message_handler *handler = handler_of(protocol, header.mtype);
+    const gcl_message_handler *handler = find_handler(protocol, header.mtype);
     if (!handler) {
         LC_LOG(LC_LOG_WARNING, "session %d: DISCARDED frame %d (%d) proto %d mtype %d", session->id,
                header.sequence, length, header.proto, header.mtype);
         return LC_OK;
     }
     CHECK_CONDITION(handler->protocol == header.proto);
+    // Handler 0 is for all types, so its own type need not agree.
     CHECK_CONDITION(handler->mtype == header.mtype || handler->mtype == 0);
     session->counters.frames_delivered++;
     session->counters.bytes_delivered += length;
@@ -364,6 +368,7 @@ lc_status next_frame(gcl_session *session, tbuffer **out_frame) {
         LC_LOG(LC_LOG_DEBUG, "session %d: bu: not enough for header", session->id);
         return LC_OK;
     }
+    // The header stays in network byte order in the read buffer; deliver_frame converts the copy.
     gcl_wire_header header;
     memcpy(&header, tb_buf(session->read_buffer) + session->read_position, sizeof header);
     const uint32_t total = to_host(header.total_length);
@@ -398,14 +403,14 @@ lc_status deliver_frames(gcl_session *session) {
         CHECK_QUIET(next_frame(session, &frame.pointer));
         if (!frame.pointer)
             return LC_OK;
-        CHECK_QUIET(hand_over(session, &frame.pointer));
+        CHECK_QUIET(deliver_frame(session, &frame.pointer));
     }
     return LC_OK;
 }
 
 // Makes room for a read. Frames that have been delivered are deleted from the front of the buffer only here,
 // once per read; deleting each frame would move all the others each time.
-lc_status make_room(gcl_session *session) {
+lc_status make_read_room(gcl_session *session) {
     tbuffer *buffer = session->read_buffer;
     if (tb_avail(buffer) >= GCL_READ_ROOM)
         return LC_OK;
@@ -418,11 +423,13 @@ lc_status make_room(gcl_session *session) {
 
 lc_status read_activity(gcl_session *session) {
     tbuffer *buffer = session->read_buffer;
-    CHECK_STATUS(make_room(session));
+    CHECK_STATUS(make_read_room(session));
     const auto length = static_cast<uint32_t>(tb_length(buffer));
     uint32_t room = static_cast<uint32_t>(tb_avail(buffer));
     room = room < GCL_READ_MAX ? room : GCL_READ_MAX;
     int closed = 0;
+    // At most `room` bytes per call: the loop calls again while there is more, so other sessions get their
+    // turn.
     const int64_t got = lf_read_bytes_closed(session->fd, tb_buf(buffer) + length, room, &closed);
     LC_LOG(LC_LOG_DEBUG, "session %d: did read = %d", session->id, static_cast<int>(got));
     if (got < 0) {
@@ -450,6 +457,7 @@ lc_status write_activity(gcl_session *session) {
 
 lc_status timer_activity(gcl_session *session) {
     LC_LOG(LC_LOG_DEBUG, "session %d: rate limit timer fired", session->id);
+    // A session that is closed before its timer fires has deleted it already.
     const int32_t timer = session->rate_timer;
     session->rate_timer = -1;
     if (timer >= 0)

@@ -158,7 +158,7 @@ lc_status open_inet(gcl_session *session) {
     return LC_OK;
 }
 
-lc_status open_socket(gcl_session *session) {
+lc_status open_session_socket(gcl_session *session) {
     session->family = session->local.address.ss_family;
     if (session->family != AF_UNIX && session->family != AF_INET) {
         LC_LOG(LC_LOG_ERR, "Unknown af %d", session->family);
@@ -204,8 +204,8 @@ void *interest_argument(uintptr_t kind) {
     return reinterpret_cast<void *>(kind);
 }
 
-lc_status new_steps(gcl_session *session, const char *client_name, const sockaddr *address,
-                    socklen_t length) {
+lc_status set_up_session(gcl_session *session, const char *client_name, const sockaddr *address,
+                         socklen_t length) {
     gcl *instance = session->instance;
     CHECK_CONDITION(lc_lock_init(&session->lock, 1) == 0);
     session->uid = static_cast<int32_t>(geteuid());
@@ -217,7 +217,7 @@ lc_status new_steps(gcl_session *session, const char *client_name, const sockadd
         CHECK_STATUS(copy_endpoint(&session->local, address, length));
     else
         make_endpoint(&session->local, "client", session->local_name);
-    CHECK_STATUS(open_socket(session));
+    CHECK_STATUS(open_session_socket(session));
     CHECK_STATUS(gcl_run_hooks(session, GCL_HOOK_NEW));
     // Appended, so that gcl_shutdown closes sessions in the order in which they were made.
     gcl_session **link = &instance->sessions;
@@ -248,7 +248,7 @@ lc_status gcl_session_client_new(gcl *instance, const char *client_name, const s
     session->fd = session->fd_interest = session->rate_timer = -1;
     session->state = GCL_SESSION_INITIALIZED;
     session->sequence = GCL_SEQUENCE_CLIENT;
-    const lc_status status = new_steps(session, client_name, address, length);
+    const lc_status status = set_up_session(session, client_name, address, length);
     if (status != LC_OK) {
         // Nobody knows the session yet, so it is freed without gcl_session_close and its log lines.
         if (session->fd >= 0)
@@ -269,7 +269,7 @@ lc_status gcl_session_client_new(gcl *instance, const char *client_name, const s
 namespace {
 
 // Closes a session that could not connect.
-void give_up(gcl_session *session) {
+void abandon_connection(gcl_session *session) {
     if (session->fd_interest >= 0)
         LOG_STATUS(fdic_event_update_fd(session->instance->interests, session->fd_interest, 0, 0));
     close(session->fd);
@@ -323,7 +323,7 @@ lc_status gcl_session_client_connect_by_sockaddr(gcl_session *session, const soc
     CHECK_STATUS(copy_endpoint(&session->peer, address, length));
     const lc_status status = try_connect(session, retry ? CONNECT_ATTEMPTS : 1);
     if (status != LC_OK) {
-        give_up(session);
+        abandon_connection(session);
         return status;
     }
     session->state = GCL_SESSION_CONNECTED;
@@ -392,7 +392,7 @@ lc_status gcl_session_close(gcl_session *session, int flush) {
 
 namespace {
 
-void take_out(gcl_session *session) {
+void unlink_session(gcl_session *session) {
     for (gcl_session **link = &session->instance->sessions; *link; link = &(*link)->next) {
         if (*link == session) {
             *link = session->next;
@@ -415,7 +415,7 @@ lc_status gcl_session_free(gcl_session **inout) {
         return LC_OK;
     }
     const gcl_session_guard guard(session);
-    take_out(session);
+    unlink_session(session);
     LOG_STATUS(gcl_run_hooks(session, GCL_HOOK_FREE));
     for (uint16_t protocol = 0; protocol < GCL_PROTOCOLS_MAX; protocol++)
         if (session->protocol_state[protocol])

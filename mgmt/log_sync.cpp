@@ -37,7 +37,7 @@ node_name class_level_node() {
     return name;
 }
 
-lc_status read_text(mdc *session, const char *node, owned_tstring *out) {
+lc_status read_level_text(mdc *session, const char *node, owned_tstring *out) {
     owned_binding binding;
     CHECK_STATUS(mdc_get_binding(session, nullptr, nullptr, 0, &binding.pointer, node, nullptr));
     if (binding.pointer)
@@ -66,10 +66,10 @@ lc_status set_daemon_level(const char *name) {
 
 lc_status qv_init_log_level(mdc *session) {
     owned_tstring system, own, override_level;
-    if (read_text(session, SYSTEM_LEVEL, &system) == LC_OK && is_filled(system) &&
+    if (read_level_text(session, SYSTEM_LEVEL, &system) == LC_OK && is_filled(system) &&
         lc_log_set_max_log_level(ts_str(system.pointer)) == LC_OK)
         LC_LOG(LC_LOG_NOTICE, "Synchronized system log level to '%s'", ts_str(system.pointer));
-    if (read_text(session, process_level_node().text, &own) == LC_OK && is_filled(own)) {
+    if (read_level_text(session, process_level_node().text, &own) == LC_OK && is_filled(own)) {
         CHECK_QUIET(set_daemon_level(ts_str(own.pointer)));
         LC_LOG(LC_LOG_NOTICE, "Synchronized daemon log level to '%s'", ts_str(own.pointer));
     }
@@ -80,7 +80,7 @@ lc_status qv_init_log_level(mdc *session) {
         CHECK_STATUS(bn_binding_get_tbool(enable.pointer, bn_attrib_value, nullptr, &value));
         CHECK_STATUS(lc_log_enable_override_log_level(1, value ? 1 : 0));
     }
-    CHECK_STATUS(read_text(session, class_level_node().text, &override_level));
+    CHECK_STATUS(read_level_text(session, class_level_node().text, &override_level));
     if (is_filled(override_level)) {
         CHECK_STATUS(enable_class_override(ts_str(override_level.pointer)));
         LC_LOG(LC_LOG_NOTICE, "Synchronized override log level to \"%s\"", ts_str(override_level.pointer));
@@ -102,7 +102,7 @@ namespace {
 
 // --- A change event
 
-lc_status value_text(const bn_binding *binding, owned_tstring *out) {
+lc_status get_value_text(const bn_binding *binding, owned_tstring *out) {
     CHECK_STATUS(bn_binding_get_tstr(binding, bn_attrib_value, 0, nullptr, &out->pointer));
     return LC_OK;
 }
@@ -115,7 +115,7 @@ lc_status change_process_level(const bn_binding *binding, bool *ended) {
     CHECK_STATUS(bn_binding_get_type(binding, bn_attrib_value, nullptr, &flags));
     const bool deleted = (flags & bn_flag_deleted) != 0;
     if (!deleted)
-        CHECK_STATUS(value_text(binding, &value));
+        CHECK_STATUS(get_value_text(binding, &value));
     LC_LOG(LC_LOG_INFO, "Found process to change level: %s=%s", bn_binding_get_name_quick(binding),
            value.pointer ? ts_str(value.pointer) : "");
     *ended = is_filled(value);
@@ -130,7 +130,7 @@ lc_status change_process_level(const bn_binding *binding, bool *ended) {
 
 lc_status change_system_level(const bn_binding *binding, bool *ended) {
     owned_tstring value;
-    CHECK_STATUS(value_text(binding, &value));
+    CHECK_STATUS(get_value_text(binding, &value));
     *ended = is_filled(value);
     if (!*ended)
         return LC_OK;
@@ -149,7 +149,7 @@ lc_status change_system_override(const bn_binding *binding, bool *) {
 
 lc_status change_class_override(const bn_binding *binding, bool *) {
     owned_tstring value;
-    CHECK_STATUS(value_text(binding, &value));
+    CHECK_STATUS(get_value_text(binding, &value));
     const int index = class_index();
     if (is_filled(value)) {
         CHECK_STATUS(enable_class_override(ts_str(value.pointer)));

@@ -167,8 +167,9 @@ lc_status mdc_foreach_binding_prequeried(const bn_binding_array *bindings, const
 
 namespace {
 
-lc_status foreach_one(const bn_binding_array *bindings, bn_binding *binding, const tstr_array *pattern_parts,
-                      mdc_foreach_function callback, void *data, uint32_t *matches) {
+lc_status call_if_matching(const bn_binding_array *bindings, bn_binding *binding,
+                           const tstr_array *pattern_parts, mdc_foreach_function callback, void *data,
+                           uint32_t *matches) {
     const tstr_array *parts = nullptr;
     int absolute = 0;
     CHECK_STATUS(bn_binding_get_name_parts_const(binding, &parts, &absolute));
@@ -209,7 +210,7 @@ lc_status mdc_foreach_binding_prequeried_parsed(const bn_binding_array *bindings
     for (uint32_t i = 0; i < count && status == LC_OK; i++) {
         bn_binding *binding = bn_binding_array_get_quick(bindings, i);
         if (binding)
-            status = foreach_one(bindings, binding, pattern_parts, callback, data, &matches);
+            status = call_if_matching(bindings, binding, pattern_parts, callback, data, &matches);
     }
     if (out_count)
         *out_count = matches;

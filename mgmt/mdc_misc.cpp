@@ -131,7 +131,7 @@ uint64_t wire_bytes(const bn_binding *binding) {
     return bytes;
 }
 
-lc_status get_node(const mon_walk *walk, const char *name, const tstr_array *parts) {
+lc_status report_node(const mon_walk *walk, const char *name, const tstr_array *parts) {
     uint32_t at = bn_binding_array_length_quick(walk->found);
     CHECK_STATUS(walk->get(name, parts, walk->get_data, walk->found));
     for (; at < bn_binding_array_length_quick(walk->found); at++)
@@ -211,7 +211,7 @@ lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts,
         uint32_t children = 0;
         CHECK_STATUS(tree_node_get_num_children(walk->registered, node, &children));
         if (!(walk->flags & bn_qf_walk_only) && (!(walk->flags & bn_qf_leaves_only) || children == 0))
-            CHECK_STATUS(get_node(walk, text, parts));
+            CHECK_STATUS(report_node(walk, text, parts));
     }
     return walk_children(walk, parts, node, depth + 1);
 }
@@ -265,7 +265,7 @@ lc_status answer_node(const mon_walk *walk, const bn_node_info *info, const bn_b
         CHECK_STATUS(bn_binding_get_name_parts(binding, &parts.pointer));
     switch (info->subop) {
     case bn_query_get:
-        CHECK_STATUS(get_node(walk, name, known ? known : parts.pointer));
+        CHECK_STATUS(report_node(walk, name, known ? known : parts.pointer));
         return LC_OK;
     case bn_query_iterate:
         CHECK_STATUS(mdc_mon_iterate_node_internal(walk, parts.pointer, 0));
@@ -404,8 +404,8 @@ const struct {
     lc_status (*take)(const change_entry *entry);
 } change_types[] = {{"add", change_add}, {"delete", change_delete}, {"modify", change_modify}};
 
-lc_status take_change(bn_binding_array *bindings, const char *entry_name, bn_binding_array *old_values,
-                      bn_binding_array *new_values) {
+lc_status add_change(bn_binding_array *bindings, const char *entry_name, bn_binding_array *old_values,
+                     bn_binding_array *new_values) {
     owned_tstring type, name;
     CHECK_STATUS(bn_binding_array_get_value_tstr_by_name_rel(bindings, entry_name, "change_type", nullptr,
                                                              &type.pointer));
@@ -459,7 +459,7 @@ lc_status mdc_event_config_change_notif_extract(bn_binding_array *bindings, bn_b
         if (tstr_array_length_quick(parts.pointer) != CHANGE_PARTS ||
             !bn_binding_name_parts_pattern_match(parts.pointer, absolute, CHANGE_PATTERN))
             continue;
-        CHECK_STATUS(take_change(bindings, name, old_values.pointer, new_values.pointer));
+        CHECK_STATUS(add_change(bindings, name, old_values.pointer, new_values.pointer));
     }
     if (out_old)
         *out_old = old_values.take();

@@ -73,7 +73,7 @@ lc_status status_of_errno() {
     }
 }
 
-lc_status refused(lc_status status, int reason) {
+lc_status refuse_with(lc_status status, int reason) {
     errno = reason;
     return status;
 }
@@ -81,7 +81,7 @@ lc_status refused(lc_status status, int reason) {
 lc_status ensure_dir_of_file(const char *path, mode_t mode) {
     char name[PATH_MAX];
     if (strlcpy(name, path, sizeof name) >= sizeof name)
-        return refused(LC_BAD_PATH, ENAMETOOLONG);
+        return refuse_with(LC_BAD_PATH, ENAMETOOLONG);
     owned_fd dir(open(name[0] == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
     char *part = name;
     for (;;) {
@@ -115,17 +115,17 @@ lc_status write_all(int fd, const char *bytes, uint32_t count) {
     return LC_OK;
 }
 
-lc_status write_file(const char *path, mode_t mode, const char *bytes, int overwrite, uint32_t count) {
+lc_status write_and_rename(const char *path, mode_t mode, const char *bytes, int overwrite, uint32_t count) {
     struct stat there;
     if (lstat(path, &there) == 0) {
         if (!S_ISREG(there.st_mode))
-            return refused(LC_BAD_FILE, S_ISLNK(there.st_mode)   ? ELOOP
-                                        : S_ISDIR(there.st_mode) ? EISDIR
-                                                                 : EINVAL);
+            return refuse_with(LC_BAD_FILE, S_ISLNK(there.st_mode)   ? ELOOP
+                                            : S_ISDIR(there.st_mode) ? EISDIR
+                                                                     : EINVAL);
         if (there.st_nlink != 1)
-            return refused(LC_BAD_FILE, EMLINK);
+            return refuse_with(LC_BAD_FILE, EMLINK);
         if (!overwrite)
-            return refused(LC_IO_FILE_EXISTS, EEXIST);
+            return refuse_with(LC_IO_FILE_EXISTS, EEXIST);
     } else if (errno != ENOENT) {
         return status_of_errno();
     }
@@ -133,7 +133,7 @@ lc_status write_file(const char *path, mode_t mode, const char *bytes, int overw
     const int length = snprintf(temporary.text, sizeof temporary.text, "%s.XXXXXX", path);
     if (length < 0 || static_cast<size_t>(length) >= sizeof temporary.text) {
         temporary.text[0] = '\0';
-        return refused(LC_BAD_PATH, ENAMETOOLONG);
+        return refuse_with(LC_BAD_PATH, ENAMETOOLONG);
     }
     owned_fd file(mkostemp(temporary.text, O_CLOEXEC));
     if (file.fd < 0) {
@@ -146,6 +146,7 @@ lc_status write_file(const char *path, mode_t mode, const char *bytes, int overw
         return written;
     if (fchmod(file.fd, mode) != 0)
         return status_of_errno();
+    // RENAME_NOREPLACE: a file that has been created since the check is not replaced.
     if (renameat2(AT_FDCWD, temporary.text, AT_FDCWD, path, overwrite ? 0 : RENAME_NOREPLACE) != 0)
         return status_of_errno();
     temporary.text[0] = '\0';
@@ -169,7 +170,7 @@ lc_status lf_write_file(const char *path, mode_t mode, const char *bytes, int ov
     if (count > 0)
         CHECK_NULL(bytes);
     const cancel_off_guard whole;
-    const lc_status status = write_file(path, mode, bytes, overwrite, count);
+    const lc_status status = write_and_rename(path, mode, bytes, overwrite, count);
     const int reason = errno;
     LOG_STATUS(status);
     errno = reason;

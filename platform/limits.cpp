@@ -42,7 +42,7 @@ const char *skip_blanks(const char *text) {
 }
 
 // Applies one line to the limits; false for a bad line.
-bool take_line(const char *line, platform_limits *limits) {
+bool apply_line(const char *line, platform_limits *limits) {
     const char *at = skip_blanks(line);
     if (*at == '\0' || *at == '#')
         return true;
@@ -94,7 +94,7 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
         line[length] = '\0';
         line[strcspn(line, "\r")] = '\0';
         // A comment may be of any length.
-        if ((good || *skip_blanks(line) == '#') && take_line(line, &limits))
+        if ((good || *skip_blanks(line) == '#') && apply_line(line, &limits))
             continue;
         if (out_bad_line)
             *out_bad_line = *out_bad_line ? *out_bad_line : number;

@@ -48,8 +48,8 @@
 namespace {
 
 constexpr int RECEIVE_BUFFER_BYTES = 208 * 1024;
-constexpr int LOOK_AGAIN_MS = 200;
-constexpr int LOOK_TRIES = 5; // a scan during which interfaces change is inconsistent, and is repeated
+constexpr int SCAN_AGAIN_MS = 200;
+constexpr int SCAN_TRIES = 5; // a scan during which interfaces change is inconsistent, and is repeated
 #ifdef WCCP_SANITIZED
 constexpr size_t STACK_BYTES = 512 * 1024;
 #else
@@ -68,8 +68,8 @@ struct interface_table {
 
 std::atomic<qv_netlink_callback> callbacks[QV_NOTIFY_KINDS];
 std::atomic<uint32_t> started; // a bit per kind
-std::atomic<bool> look_wanted; // a scan is to be made
-int wake_fd = -1;              // an eventfd: look_wanted has been set
+std::atomic<bool> scan_wanted; // a scan is to be made
+int wake_fd = -1;              // an eventfd: scan_wanted has been set
 pthread_mutex_t start_mutex = PTHREAD_MUTEX_INITIALIZER;
 bool running; // the thread has been started; start_mutex guards it
 
@@ -77,7 +77,7 @@ bool running; // the thread has been started; start_mutex guards it
 nl_sock *monitor_socket;
 interface_table known;
 
-void tell_link(const char *name, uint32_t admin_up, uint32_t link_up) {
+void report_link(const char *name, uint32_t admin_up, uint32_t link_up) {
     if (!name[0] || !(started.load(std::memory_order_acquire) & (1u << QV_NOTIFY_LINK_STATE)))
         return;
     qv_if_state_info info = {};
@@ -87,7 +87,7 @@ void tell_link(const char *name, uint32_t admin_up, uint32_t link_up) {
     callbacks[QV_NOTIFY_LINK_STATE].load(std::memory_order_acquire)(&info);
 }
 
-void tell_address(const char *name) {
+void report_address(const char *name) {
     if (!name[0] || !(started.load(std::memory_order_acquire) & (1u << QV_NOTIFY_IPA_CHANGE)))
         return;
     char copy[IFNAMSIZ];
@@ -95,21 +95,21 @@ void tell_address(const char *name) {
     callbacks[QV_NOTIFY_IPA_CHANGE].load(std::memory_order_acquire)(copy);
 }
 
-interface *find_index(const interface_table *table, int index) {
+interface *find_by_index(const interface_table *table, int index) {
     for (uint32_t i = 0; i < table->count; i++)
         if (table->entries[i].index == index)
             return &table->entries[i];
     return nullptr;
 }
 
-interface *find_name(const interface_table *table, const char *name) {
+interface *find_by_name(const interface_table *table, const char *name) {
     for (uint32_t i = 0; i < table->count; i++)
         if (strncmp(table->entries[i].name, name, IFNAMSIZ) == 0)
             return &table->entries[i];
     return nullptr;
 }
 
-bool append(interface_table *table, const interface *entry) {
+bool add_interface(interface_table *table, const interface *entry) {
     if (table->count == table->room) {
         const uint32_t room = table->room ? table->room * 2 : 16;
         void *grown = realloc(table->entries, room * sizeof(interface));
@@ -123,12 +123,12 @@ bool append(interface_table *table, const interface *entry) {
 }
 
 // Reports a name that no interface has any more.
-void tell_gone(const char *name) {
-    tell_link(name, 0, 0);
-    tell_address(name);
+void report_gone(const char *name) {
+    report_link(name, 0, 0);
+    report_address(name);
 }
 
-bool read_link(nlmsghdr *header, interface *out) {
+bool parse_link(nlmsghdr *header, interface *out) {
     nlattr *attributes[IFLA_MAX + 1];
     if (nlmsg_parse(header, sizeof(ifinfomsg), attributes, IFLA_MAX, nullptr) < 0)
         return false;
@@ -145,20 +145,20 @@ bool read_link(nlmsghdr *header, interface *out) {
     return out->name[0] != '\0';
 }
 
-void want_look() {
-    look_wanted.store(true, std::memory_order_release);
+void request_scan() {
+    scan_wanted.store(true, std::memory_order_release);
 }
 
-void link_is(const interface *now) {
-    interface *holder = find_name(&known, now->name);
+void update_link(const interface *now) {
+    interface *holder = find_by_name(&known, now->name);
     if (holder && holder->index != now->index)
         holder->name[0] = '\0'; // it has been renamed or deleted, and its own notification follows
-    interface *before = find_index(&known, now->index);
+    interface *before = find_by_index(&known, now->index);
     if (!before) {
-        if (!append(&known, now))
-            return want_look();
-        tell_link(now->name, now->admin_up, now->link_up);
-        tell_address(now->name);
+        if (!add_interface(&known, now))
+            return request_scan();
+        report_link(now->name, now->admin_up, now->link_up);
+        report_address(now->name);
         return;
     }
     // Copied, since the table changes before the callbacks run.
@@ -166,21 +166,21 @@ void link_is(const interface *now) {
     *before = *now;
     const bool renamed = strncmp(old.name, now->name, IFNAMSIZ) != 0;
     if (renamed && old.name[0])
-        tell_gone(old.name);
+        report_gone(old.name);
     if (renamed || old.admin_up != now->admin_up || old.link_up != now->link_up)
-        tell_link(now->name, now->admin_up, now->link_up);
+        report_link(now->name, now->admin_up, now->link_up);
     if (renamed)
-        tell_address(now->name);
+        report_address(now->name);
 }
 
-void link_gone(int index) {
-    interface *entry = find_index(&known, index);
+void remove_link(int index) {
+    interface *entry = find_by_index(&known, index);
     if (!entry)
         return;
     const interface old = *entry;
     *entry = known.entries[--known.count];
     if (old.name[0])
-        tell_gone(old.name);
+        report_gone(old.name);
 }
 
 int on_notification(nl_msg *message, void *) {
@@ -188,22 +188,22 @@ int on_notification(nl_msg *message, void *) {
     interface link;
     switch (header->nlmsg_type) {
     case RTM_NEWLINK:
-        if (read_link(header, &link))
-            link_is(&link);
+        if (parse_link(header, &link))
+            update_link(&link);
         break;
     case RTM_DELLINK:
-        if (read_link(header, &link))
-            link_gone(link.index);
+        if (parse_link(header, &link))
+            remove_link(link.index);
         break;
     case RTM_NEWADDR:
     case RTM_DELADDR:
         if (nlmsg_valid_hdr(header, sizeof(ifaddrmsg))) {
             const auto *address = static_cast<const ifaddrmsg *>(nlmsg_data(header));
             char name[IFNAMSIZ];
-            if (const interface *entry = find_index(&known, static_cast<int>(address->ifa_index)))
-                tell_address(entry->name);
+            if (const interface *entry = find_by_index(&known, static_cast<int>(address->ifa_index)))
+                report_address(entry->name);
             else if (if_indextoname(address->ifa_index, name))
-                want_look(); // it exists, and its own notification has been missed
+                request_scan(); // it exists, and its own notification has been missed
         }
         break;
     default:
@@ -212,11 +212,11 @@ int on_notification(nl_msg *message, void *) {
     return NL_OK;
 }
 
-int on_look_answer(nl_msg *message, void *table) {
+int on_scan_answer(nl_msg *message, void *table) {
     nlmsghdr *header = nlmsg_hdr(message);
     interface link;
-    if (header->nlmsg_type == RTM_NEWLINK && read_link(header, &link) &&
-        !append(static_cast<interface_table *>(table), &link))
+    if (header->nlmsg_type == RTM_NEWLINK && parse_link(header, &link) &&
+        !add_interface(static_cast<interface_table *>(table), &link))
         return -NLE_NOMEM;
     return NL_OK;
 }
@@ -231,7 +231,7 @@ void empty_queue() {
             return;
 }
 
-nl_sock *open_socket() {
+nl_sock *open_netlink_socket() {
     nl_sock *socket = nl_socket_alloc();
     if (socket && nl_connect(socket, NETLINK_ROUTE) == 0)
         return socket;
@@ -240,13 +240,13 @@ nl_sock *open_socket() {
 }
 
 // Queries all interfaces, on a socket of its own. False if there is no complete and consistent answer.
-bool ask_for_all(interface_table *out) {
-    nl_sock *socket = open_socket();
+bool query_all_links(interface_table *out) {
+    nl_sock *socket = open_netlink_socket();
     if (!socket)
         return false;
-    nl_socket_modify_cb(socket, NL_CB_VALID, NL_CB_CUSTOM, on_look_answer, out);
+    nl_socket_modify_cb(socket, NL_CB_VALID, NL_CB_CUSTOM, on_scan_answer, out);
     int result = -NLE_DUMP_INTR;
-    for (int tries = 0; tries < LOOK_TRIES && result == -NLE_DUMP_INTR; tries++) {
+    for (int tries = 0; tries < SCAN_TRIES && result == -NLE_DUMP_INTR; tries++) {
         ifinfomsg all = {};
         out->count = 0;
         result = nl_send_simple(socket, RTM_GETLINK, NLM_F_DUMP, &all, sizeof all);
@@ -257,10 +257,10 @@ bool ask_for_all(interface_table *out) {
     return result >= 0;
 }
 
-bool look_at_all() {
+bool scan_links() {
     empty_queue();
     interface_table fresh = {};
-    if (!ask_for_all(&fresh)) {
+    if (!query_all_links(&fresh)) {
         free(fresh.entries);
         return false;
     }
@@ -268,26 +268,26 @@ bool look_at_all() {
     interface_table old = known;
     known = fresh;
     for (uint32_t i = 0; i < old.count; i++) {
-        const interface *now = find_index(&known, old.entries[i].index);
+        const interface *now = find_by_index(&known, old.entries[i].index);
         if (!now || strncmp(now->name, old.entries[i].name, IFNAMSIZ) != 0)
-            tell_gone(old.entries[i].name);
+            report_gone(old.entries[i].name);
     }
     free(old.entries);
     for (uint32_t i = 0; i < known.count; i++) {
         const interface entry = known.entries[i];
-        tell_link(entry.name, entry.admin_up, entry.link_up);
-        tell_address(entry.name);
+        report_link(entry.name, entry.admin_up, entry.link_up);
+        report_address(entry.name);
     }
     return true;
 }
 
-void *monitor(void *) {
+void *run_monitor(void *) {
     for (;;) {
         int wait = -1;
         // Before the scan, so that a request made during it isn't lost.
-        if (look_wanted.exchange(false, std::memory_order_acq_rel) && !look_at_all()) {
-            want_look();
-            wait = LOOK_AGAIN_MS;
+        if (scan_wanted.exchange(false, std::memory_order_acq_rel) && !scan_links()) {
+            request_scan();
+            wait = SCAN_AGAIN_MS;
         }
         pollfd fds[2] = {{nl_socket_get_fd(monitor_socket), POLLIN, 0}, {wake_fd, POLLIN, 0}};
         if (poll(fds, 2, wait) < 0)
@@ -299,13 +299,13 @@ void *monitor(void *) {
             const int result = nl_recvmsgs_default(monitor_socket);
             // Most of all ENOBUFS: the queue has overrun.
             if (result < 0 && result != -NLE_AGAIN && result != -NLE_INTR)
-                want_look();
+                request_scan();
         }
     }
     return nullptr;
 }
 
-void close_all() {
+void close_descriptors() {
     nl_socket_free(monitor_socket);
     if (wake_fd >= 0)
         close(wake_fd);
@@ -313,8 +313,8 @@ void close_all() {
     wake_fd = -1;
 }
 
-bool open_all() {
-    monitor_socket = open_socket();
+bool open_descriptors() {
+    monitor_socket = open_netlink_socket();
     wake_fd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (!monitor_socket || wake_fd < 0)
         return false;
@@ -326,7 +326,7 @@ bool open_all() {
            nl_socket_add_memberships(monitor_socket, RTNLGRP_LINK, RTNLGRP_IPV4_IFADDR, RTNLGRP_NONE) == 0;
 }
 
-int start_thread() {
+int start_monitor_thread() {
     pthread_attr_t attributes;
     if (const int error = pthread_attr_init(&attributes))
         return error;
@@ -336,7 +336,7 @@ int start_thread() {
     sigfillset(&all);
     pthread_sigmask(SIG_SETMASK, &all, &previous); // the new thread inherits the mask
     pthread_t thread;
-    const int error = pthread_create(&thread, &attributes, monitor, nullptr);
+    const int error = pthread_create(&thread, &attributes, run_monitor, nullptr);
     pthread_sigmask(SIG_SETMASK, &previous, nullptr);
     pthread_attr_destroy(&attributes);
     if (error == 0)
@@ -360,15 +360,15 @@ int qv_netlink_start(uint32_t kind) {
     const mutex_guard guard(&start_mutex);
     int error = 0;
     if (!running) {
-        error = open_all() ? start_thread() : EIO;
+        error = open_descriptors() ? start_monitor_thread() : EIO;
         if (error == 0)
             running = true;
         else
-            close_all();
+            close_descriptors();
     }
     if (error == 0) {
         started.fetch_or(1u << kind, std::memory_order_acq_rel);
-        want_look();
+        request_scan();
         const uint64_t one = 1;
         if (write(wake_fd, &one, sizeof one) < 0)
             error = EIO;

@@ -83,17 +83,18 @@ struct inputs {
     bool operator==(const inputs &) const = default;
 };
 
-inputs read_once(const wccp_tunnel_mailbox *mailbox) {
+inputs read_inputs_once(const wccp_tunnel_mailbox *mailbox) {
     return {mailbox_get(mailbox->tunnel_id),  mailbox_get(mailbox->local_ip), mailbox_get(mailbox->remote_ip),
             mailbox_get(mailbox->fmst_index), mailbox_get(mailbox->l2_group), mailbox_get(mailbox->l2_value)};
 }
 
 inputs read_inputs(const wccp_tunnel_mailbox *mailbox) {
     for (int tries = 0;; tries++) {
+        // A 0 at any of the three reads means that wccpd may have been writing in between.
         const uint16_t before = mailbox->command.load(std::memory_order_acquire);
-        const inputs first = read_once(mailbox);
+        const inputs first = read_inputs_once(mailbox);
         const uint16_t between = mailbox->command.load(std::memory_order_acquire);
-        const inputs second = read_once(mailbox);
+        const inputs second = read_inputs_once(mailbox);
         const uint16_t after = mailbox->command.load(std::memory_order_acquire);
         const bool whole = before == between && between == after && before != MAILBOX_IDLE && first == second;
         if (whole || tries == 1000)

@@ -85,7 +85,7 @@ lc_status array_options_set(array *list, const array_options *options) {
 
 namespace {
 
-void release_record(array *list) {
+void free_array_record(array *list) {
     free(list);
 }
 
@@ -96,7 +96,7 @@ lc_status array_new(array **out, const array_options *options) {
     *out = nullptr;
     array_options defaults;
     CHECK_STATUS(array_options_get_defaults(&defaults));
-    owned<array, release_record> list(static_cast<array *>(calloc(1, sizeof(array))));
+    owned<array, free_array_record> list(static_cast<array *>(calloc(1, sizeof(array))));
     CHECK_NULL(list.pointer);
     (void)array_options_set(list.pointer, options ? options : &defaults);
     list.pointer->elements = static_cast<void **>(calloc(list.pointer->initial_size, sizeof(void *)));
@@ -118,7 +118,7 @@ void array_place(array *record, const array_options *options, void **elements, u
 
 namespace {
 
-void give(array *list, void *element) {
+void free_element(array *list, void *element) {
     if (element)
         list->free(element);
 }
@@ -133,7 +133,7 @@ lc_status array_free(array **inout) {
         return LC_OK;
     array_index_drop(list);
     while (list->length)
-        give(list, list->elements[--list->length]);
+        free_element(list, list->elements[--list->length]);
     if (!list->placed_elements)
         free(list->elements);
     if (!list->placed_record)
@@ -144,7 +144,7 @@ lc_status array_empty(array *list) {
     CHECK_NULL(list);
     array_index_drop(list);
     while (list->length)
-        give(list, list->elements[--list->length]);
+        free_element(list, list->elements[--list->length]);
     list->sorted = 1;
     if (list->capacity != list->initial_size) {
         auto *smaller = static_cast<void **>(realloc(list->elements, list->initial_size * sizeof(void *)));
@@ -158,7 +158,7 @@ lc_status array_empty(array *list) {
 
 namespace {
 
-lc_status make_room(array *list, uint64_t length) {
+lc_status reserve_slots(array *list, uint64_t length) {
     CHECK_CONDITION(length <= array_size_max);
     uint64_t capacity = list->capacity;
     while (capacity < length)
@@ -207,7 +207,7 @@ lc_status array_peek(const array *list, void **out_element) {
 
 namespace {
 
-lc_status copy_of(const array *list, const void *element, void **out) {
+lc_status copy_element(const array *list, const void *element, void **out) {
     *out = nullptr;
     if (!element)
         return LC_OK;
@@ -218,18 +218,18 @@ lc_status copy_of(const array *list, const void *element, void **out) {
 
 // Runs a _takeover operation with a copy of the element, and frees the copy if the operation didn't take it.
 template <typename Operation>
-lc_status with_copy(array *list, const void *element, Operation operation) {
+lc_status call_with_copy(array *list, const void *element, Operation operation) {
     CHECK_NULL(list);
     void *copy = nullptr;
-    CHECK_QUIET(copy_of(list, element, &copy));
+    CHECK_QUIET(copy_element(list, element, &copy));
     const lc_status status = operation(&copy);
-    give(list, copy);
+    free_element(list, copy);
     return status;
 }
 
 // Clears `sorted` if the new element at `index` is out of order with its neighbours. An array of one element
 // is sorted; nulls never are.
-void note_order(array *list, uint32_t index) {
+void update_sorted(array *list, uint32_t index) {
     if (!list->sorted)
         return;
     void **at = &list->elements[index];
@@ -243,7 +243,7 @@ void note_order(array *list, uint32_t index) {
 lc_status array_set_takeover(array *list, uint32_t index, void **inout_element) {
     CHECK_NULL(list);
     CHECK_NULL(inout_element);
-    CHECK_STATUS(make_room(list, uint64_t{index} + 1));
+    CHECK_STATUS(reserve_slots(list, uint64_t{index} + 1));
     array_index_drop(list);
     while (list->length <= index)
         list->elements[list->length++] = nullptr;
@@ -255,11 +255,11 @@ lc_status array_set_takeover(array *list, uint32_t index, void **inout_element) 
         return LC_OK;
     }
     CHECK_STATUS(list->takeover(inout_element, &list->elements[index]));
-    give(list, old);
+    free_element(list, old);
     return LC_OK;
 }
 lc_status array_set(array *list, uint32_t index, const void *element) {
-    return with_copy(list, element, [&](void **copy) { return array_set_takeover(list, index, copy); });
+    return call_with_copy(list, element, [&](void **copy) { return array_set_takeover(list, index, copy); });
 }
 
 lc_status array_insert_takeover(array *list, uint32_t index, void **inout_element) {
@@ -267,7 +267,7 @@ lc_status array_insert_takeover(array *list, uint32_t index, void **inout_elemen
     CHECK_NULL(inout_element);
     if (index > list->length) // nothing to move up; array_set fills the gap with nulls
         return array_set_takeover(list, index, inout_element);
-    CHECK_STATUS(make_room(list, uint64_t{list->length} + 1));
+    CHECK_STATUS(reserve_slots(list, uint64_t{list->length} + 1));
     if (index < list->length)
         array_index_drop(list);
     void *slot = nullptr;
@@ -275,7 +275,7 @@ lc_status array_insert_takeover(array *list, uint32_t index, void **inout_elemen
     memmove(list->elements + index + 1, list->elements + index, (list->length - index) * sizeof(void *));
     list->elements[index] = slot;
     list->length++;
-    note_order(list, index);
+    update_sorted(list, index);
     return LC_OK;
 }
 
@@ -283,12 +283,12 @@ namespace {
 
 // Applies the policy to a new element that equals the one at `index`. `out_done`: the new one isn't to be
 // inserted.
-lc_status meet_equal(array *list, uint32_t index, void **inout_element, bool *out_done) {
+lc_status apply_duplicate_policy(array *list, uint32_t index, void **inout_element, bool *out_done) {
     *out_done = true;
     if (list->duplicate_policy == array_dup_refuse)
         return LC_EXISTS;
     if (list->duplicate_policy == array_dup_drop) {
-        give(list, *inout_element);
+        free_element(list, *inout_element);
         *inout_element = nullptr;
         return LC_OK;
     }
@@ -302,18 +302,19 @@ lc_status array_append_no_dup_takeover(array *list, void **inout_element) {
     CHECK_NULL(list);
     CHECK_NULL(inout_element);
     uint32_t index = 0;
-    CHECK_STATUS(make_room(list, uint64_t{list->length} + 1));
+    CHECK_STATUS(reserve_slots(list, uint64_t{list->length} + 1));
     if (list->duplicate_policy != array_dup_allow &&
         array_linear_search(list, *inout_element, 0, &index) == LC_OK) {
         bool done = false;
-        CHECK_QUIET(meet_equal(list, index, inout_element, &done));
+        CHECK_QUIET(apply_duplicate_policy(list, index, inout_element, &done));
         if (done)
             return LC_OK;
     }
     return array_insert_takeover(list, list->length, inout_element);
 }
 lc_status array_append_no_dup(array *list, const void *element) {
-    return with_copy(list, element, [&](void **copy) { return array_append_no_dup_takeover(list, copy); });
+    return call_with_copy(list, element,
+                          [&](void **copy) { return array_append_no_dup_takeover(list, copy); });
 }
 lc_status array_append(array *list, const void *element) {
     return array_append_no_dup(list, element);
@@ -339,13 +340,13 @@ lc_status array_insert_sorted_hint_takeover(array *list, void **inout_element, u
     CHECK_NULL(inout_element);
     CHECK_CONDITION(list->sorted || !list->require_sorted);
     uint32_t index = 0;
-    CHECK_STATUS(make_room(list, uint64_t{list->length} + 1));
+    CHECK_STATUS(reserve_slots(list, uint64_t{list->length} + 1));
     CHECK_STATUS(array_find_insertion_point_hint(list, *inout_element, hint, &index));
     // Equal elements are just before the insertion point.
     if (index > 0 && list->duplicate_policy != array_dup_allow &&
         list->compare(&list->elements[index - 1], inout_element) == 0) {
         bool done = false;
-        CHECK_QUIET(meet_equal(list, --index, inout_element, &done));
+        CHECK_QUIET(apply_duplicate_policy(list, --index, inout_element, &done));
         if (done)
             return LC_OK;
     }
@@ -357,8 +358,8 @@ lc_status array_insert_sorted_takeover(array *list, void **inout_element) {
     return array_insert_sorted_hint_takeover(list, inout_element, 0);
 }
 lc_status array_insert_sorted_hint(array *list, const void *element, uint32_t hint) {
-    return with_copy(list, element,
-                     [&](void **copy) { return array_insert_sorted_hint_takeover(list, copy, hint); });
+    return call_with_copy(list, element,
+                          [&](void **copy) { return array_insert_sorted_hint_takeover(list, copy, hint); });
 }
 lc_status array_insert_sorted(array *list, const void *element) {
     return array_insert_sorted_hint(list, element, 0);
@@ -385,13 +386,13 @@ lc_status array_remove(array *list, uint32_t index, void **out_element) {
 lc_status array_delete(array *list, uint32_t index) {
     void *element = nullptr;
     CHECK_QUIET(array_remove(list, index, &element));
-    give(list, element);
+    free_element(list, element);
     return LC_OK;
 }
 lc_status array_delete_no_shift(array *list, uint32_t index) {
     void *element = nullptr;
     CHECK_QUIET(array_remove_no_shift(list, index, &element));
-    give(list, element);
+    free_element(list, element);
     return LC_OK;
 }
 lc_status array_pop(array *list, void **out_element) {
@@ -417,7 +418,7 @@ lc_status array_sort(array *list) {
 
 namespace {
 
-lc_status told(uint32_t index, uint32_t *out_index) {
+lc_status set_out_index(uint32_t index, uint32_t *out_index) {
     if (out_index)
         *out_index = index;
     return LC_OK;
@@ -440,14 +441,14 @@ lc_status array_binary_search(const array *list, const void *key, uint32_t *out_
     }
     if (low == list->length || list->compare(&list->elements[low], &key) != 0)
         return LC_NOT_FOUND;
-    return told(low, out_index);
+    return set_out_index(low, out_index);
 }
 lc_status array_linear_search(const array *list, const void *key, uint32_t start, uint32_t *out_index) {
     CHECK_NULL(list);
     CHECK_CONDITION(list->compare);
     for (uint32_t i = start; i < list->length; i++)
         if (list->compare(&list->elements[i], &key) == 0)
-            return told(i, out_index);
+            return set_out_index(i, out_index);
     return LC_NOT_FOUND;
 }
 lc_status array_best_search(const array *list, const void *key, uint32_t *out_index) {
@@ -459,7 +460,7 @@ lc_status array_best_search(const array *list, const void *key, uint32_t *out_in
     bool found = false;
     if (!array_index_find(list, key, &index, &found))
         return array_linear_search(list, key, 0, out_index);
-    return found ? told(index, out_index) : LC_NOT_FOUND;
+    return found ? set_out_index(index, out_index) : LC_NOT_FOUND;
 }
 
 // --- Whole arrays
@@ -472,10 +473,10 @@ lc_status array_duplicate(const array *list, array **out) {
     CHECK_STATUS(array_options_get(list, &options));
     array *copy = nullptr;
     CHECK_STATUS(array_new(&copy, &options));
-    lc_status status = make_room(copy, list->length);
+    lc_status status = reserve_slots(copy, list->length);
     // The copy's length grows with each element, so that array_free frees exactly those that were copied.
     for (uint32_t i = 0; i < list->length && status == LC_OK; i++) {
-        status = copy_of(list, list->elements[i], &copy->elements[i]);
+        status = copy_element(list, list->elements[i], &copy->elements[i]);
         if (status == LC_OK)
             copy->length = i + 1;
     }
@@ -491,12 +492,12 @@ lc_status array_concat(array *list, array *moved) {
     CHECK_NULL(moved);
     CHECK_CONDITION(list != moved);
     const uint64_t length = uint64_t{list->length} + moved->length;
-    CHECK_STATUS(make_room(list, length));
+    CHECK_STATUS(reserve_slots(list, length));
     // Cannot fail from here on, so that no element is in both arrays or in neither.
     array_index_drop(moved);
     for (uint32_t i = 0; i < moved->length; i++) {
         list->elements[list->length++] = moved->elements[i];
-        note_order(list, list->length - 1);
+        update_sorted(list, list->length - 1);
     }
     moved->length = 0;
     return array_empty(moved);
@@ -514,7 +515,7 @@ int array_equal(const array *a, const array *b) {
 
 namespace {
 
-lc_status walk(array *list, array_foreach_function function, void *data, bool deletes) {
+lc_status visit_elements(array *list, array_foreach_function function, void *data, bool deletes) {
     CHECK_NULL(list);
     CHECK_NULL(function);
     lc_status result = LC_OK;
@@ -551,8 +552,8 @@ lc_status walk(array *list, array_foreach_function function, void *data, bool de
 } // namespace
 
 lc_status array_foreach(array *list, array_foreach_function function, void *data) {
-    return walk(list, function, data, false);
+    return visit_elements(list, function, data, false);
 }
 lc_status array_foreach_delete(array *list, array_foreach_function function, void *data) {
-    return walk(list, function, data, true);
+    return visit_elements(list, function, data, true);
 }

@@ -16,7 +16,7 @@ constexpr uint32_t INDEX_MIN_LENGTH = 16;
 
 namespace {
 
-uint32_t changes_now(const array *list) {
+uint32_t count_key_changes(const array *list) {
     return list->key_changes ? list->key_changes->load(std::memory_order_relaxed) : 0;
 }
 
@@ -30,7 +30,7 @@ void array_index_drop(const array *list) {
 namespace {
 
 // The slot of an equal element, or else the free slot where the key belongs.
-uint32_t *slot_of(const array *list, const void *key) {
+uint32_t *find_index_slot(const array *list, const void *key) {
     const uint32_t mask = list->index->slot_count - 1;
     uint32_t at = list->hash(key) & mask;
     while (list->index->slots[at]) {
@@ -46,6 +46,7 @@ bool make_index(const array *list) {
     uint32_t count = 64;
     while (count < 3 * uint64_t{list->length} && count < 0x40000000)
         count *= 2;
+    // No index for an array so long that the table would be half full.
     if (list->length >= count / 2)
         return false;
     list->index =
@@ -53,14 +54,14 @@ bool make_index(const array *list) {
     if (!list->index)
         return false;
     list->index->slot_count = count;
-    list->index->key_changes = changes_now(list);
+    list->index->key_changes = count_key_changes(list);
     return true;
 }
 
-bool bring_up_to_date(const array *list) {
+bool update_index(const array *list) {
     // A key that has changed inside an element makes its entry wrong, and so does an array that got shorter.
     if (list->index &&
-        (list->index->key_changes != changes_now(list) || list->index->indexed > list->length ||
+        (list->index->key_changes != count_key_changes(list) || list->index->indexed > list->length ||
          2 * uint64_t{list->length} > list->index->slot_count))
         array_index_drop(list);
     if (!list->index && !make_index(list))
@@ -69,7 +70,7 @@ bool bring_up_to_date(const array *list) {
         const uint32_t position = list->index->indexed++;
         if (!list->elements[position])
             continue;
-        uint32_t *slot = slot_of(list, list->elements[position]);
+        uint32_t *slot = find_index_slot(list, list->elements[position]);
         // The first of several equal elements keeps the slot, as a search from the start would find it.
         if (!*slot)
             *slot = position + 1;
@@ -80,9 +81,9 @@ bool bring_up_to_date(const array *list) {
 } // namespace
 
 bool array_index_find(const array *list, const void *key, uint32_t *out_position, bool *out_found) {
-    if (!list->hash || !key || list->length < INDEX_MIN_LENGTH || !bring_up_to_date(list))
+    if (!list->hash || !key || list->length < INDEX_MIN_LENGTH || !update_index(list))
         return false;
-    const uint32_t found = *slot_of(list, key);
+    const uint32_t found = *find_index_slot(list, key);
     *out_found = found != 0;
     *out_position = found - 1;
     return true;

@@ -370,7 +370,7 @@ const cmem_conf *find_conf(const cmem_registry *known, const char *name) {
 }
 
 // Fills a record that this process has claimed.
-void reset_block(cmem_block *block, const cmem_registry *known, const char *name, uint64_t length) {
+void fill_block_record(cmem_block *block, const cmem_registry *known, const char *name, uint64_t length) {
     static const cmem_conf unlisted = {{}, NORMAL_PAGE, 0, NODE_LOCAL, 0, 0};
     const cmem_conf *entry = find_conf(known, name);
     block->configured = entry != nullptr;
@@ -453,7 +453,7 @@ cmem_block *claim_name(cmem_registry *known, const char *name, uint64_t length) 
     cmem_block *block = take_block(known, name, length);
     if (!block)
         return nullptr;
-    reset_block(block, known, name, length);
+    fill_block_record(block, known, name, length);
     created_here[block - known->blocks] = true;
     return block;
 }

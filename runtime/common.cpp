@@ -122,7 +122,7 @@ lc_status lc_check_forced(lc_status status, const char *function, const char *fi
 
 namespace {
 
-const char *find_name(const lc_enum_entry *table, int32_t value) {
+const char *find_enum_name(const lc_enum_entry *table, int32_t value) {
     for (const lc_enum_entry *entry = table; entry->name; entry++)
         if (entry->value == value)
             return entry->name;
@@ -138,14 +138,14 @@ const char *lc_enum_to_string(const lc_enum_entry *table, int32_t value) {
         (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);
         return NO_MAP;
     }
-    const char *name = find_name(table, value);
+    const char *name = find_enum_name(table, value);
     if (!name)
         LC_LOG(LC_LOG_ERR, "Could not find a mapping for enum value %d", value);
     return name ? name : NO_MAP;
 }
 
 const char *lc_enum_to_string_quiet(const lc_enum_entry *table, int32_t value) {
-    const char *name = table ? find_name(table, value) : nullptr;
+    const char *name = table ? find_enum_name(table, value) : nullptr;
     return name ? name : NO_MAP;
 }
 
@@ -154,7 +154,7 @@ const char *lc_enum_to_string_quiet_null(const lc_enum_entry *table, int32_t val
         (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);
         return nullptr;
     }
-    return find_name(table, value);
+    return find_enum_name(table, value);
 }
 
 lc_status lc_string_to_enum(const lc_enum_entry *table, const char *string, int32_t *out_value) {
@@ -341,7 +341,7 @@ lc_status lc_getenv_ts(const char *name, char **out_text) {
 
 namespace {
 
-int set_locked(const char *name, const char *value, int overwrite) {
+int setenv_with_lock(const char *name, const char *value, int overwrite) {
     const env_guard guard;
     return setenv(name, value, overwrite);
 }
@@ -355,7 +355,7 @@ lc_status lc_setenv(const char *name, const char *value, int overwrite) {
         LC_LOG(LC_LOG_ERR, "Environment variable name \"%s\" contains illegal character '='", name);
         return LC_GENERIC;
     }
-    CHECK_CONDITION(set_locked(name, value, overwrite) == 0);
+    CHECK_CONDITION(setenv_with_lock(name, value, overwrite) == 0);
     return LC_OK;
 }
 
@@ -381,7 +381,7 @@ struct lc_lock {
 
 namespace {
 
-int64_t this_thread() {
+int64_t own_thread_id() {
     return static_cast<int64_t>(pthread_self());
 }
 
@@ -389,7 +389,7 @@ int64_t this_thread() {
 // level.
 void release_at_thread_end(void *held) {
     lc_lock *lock = static_cast<lc_lock *>(held);
-    while (lock->locked && lock->owner == this_thread() && lc_lock_unlock(lock) == 0) {
+    while (lock->locked && lock->owner == own_thread_id() && lc_lock_unlock(lock) == 0) {
     }
 }
 
@@ -429,7 +429,7 @@ int lc_lock_lock(lc_lock *lock) {
     const int result = pthread_mutex_lock(&lock->mutex);
     if (result != 0)
         return result;
-    lock->owner = this_thread();
+    lock->owner = own_thread_id();
     lock->locked = 1;
     // If this fails for lack of memory, the lock works but isn't released at the end of the thread.
     if (lock->nesting++ == 0)
@@ -438,7 +438,7 @@ int lc_lock_lock(lc_lock *lock) {
 }
 
 int lc_lock_unlock(lc_lock *lock) {
-    if (!lock || !lock->locked || lock->owner != this_thread())
+    if (!lock || !lock->locked || lock->owner != own_thread_id())
         return 1;
     // The fields are changed while the mutex is still held: after the unlock they belong to the next owner.
     if (--lock->nesting == 0 || !lock->recursive) {

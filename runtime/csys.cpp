@@ -18,12 +18,12 @@ constexpr uint32_t OVERHEAD = sizeof(csys_display_buf) + 1; // descriptor and te
 namespace {
 
 // The caller's memory may end at any address, so the descriptor can be unaligned: it is copied in and out.
-csys_display_buf load(const csys_display_buf *buffer) {
+csys_display_buf load_descriptor(const csys_display_buf *buffer) {
     csys_display_buf copy;
     memcpy(&copy, static_cast<const void *>(buffer), sizeof copy);
     return copy;
 }
-void save(csys_display_buf *buffer, const csys_display_buf *copy) {
+void save_descriptor(csys_display_buf *buffer, const csys_display_buf *copy) {
     memcpy(static_cast<void *>(buffer), copy, sizeof *copy);
 }
 
@@ -41,13 +41,13 @@ csys_display_buf *csys_create_safe_display_buf_desc(void *memory, uint32_t size)
 }
 
 int csys_chk_display_buf(const csys_display_buf *buffer) {
-    return !buffer || load(buffer).magic != MAGIC;
+    return !buffer || load_descriptor(buffer).magic != MAGIC;
 }
 
 uint32_t csys_append_to_safe_display_buf(csys_display_buf *buffer, const char *string) {
     if (csys_chk_display_buf(buffer) || !string)
         return 0;
-    csys_display_buf state = load(buffer);
+    csys_display_buf state = load_descriptor(buffer);
     const size_t length = strlen(string);
     if (state.left == 0 || length == 0)
         return 0;
@@ -60,21 +60,22 @@ uint32_t csys_append_to_safe_display_buf(csys_display_buf *buffer, const char *s
     if (!fits)
         state.position[-1] = '\n';
     *state.position = '\0';
-    save(buffer, &state);
+    save_descriptor(buffer, &state);
     return fits ? copied : 0;
 }
 
 uint32_t csys_display_buf_bytes_used(const csys_display_buf *buffer) {
     if (csys_chk_display_buf(buffer))
         return 0;
-    const csys_display_buf state = load(buffer);
+    const csys_display_buf state = load_descriptor(buffer);
     return static_cast<uint32_t>(state.position - state.start);
 }
 
 uint32_t csys_display_buf_bytes_max(const csys_display_buf *buffer) {
-    return csys_chk_display_buf(buffer) ? 0 : csys_display_buf_bytes_used(buffer) + load(buffer).left;
+    return csys_chk_display_buf(buffer) ? 0
+                                        : csys_display_buf_bytes_used(buffer) + load_descriptor(buffer).left;
 }
 
 const char *csys_display_buf_text(const csys_display_buf *buffer) {
-    return csys_chk_display_buf(buffer) ? "" : load(buffer).start;
+    return csys_chk_display_buf(buffer) ? "" : load_descriptor(buffer).start;
 }

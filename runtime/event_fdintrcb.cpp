@@ -96,7 +96,7 @@ lc_status fdic_libevent_set_fd_open_handler(fdic_libevent *bridge, fdic_handler 
 
 namespace {
 
-fdic_libevent_entry *find_entry(const fdic_libevent *bridge, uint32_t id) {
+fdic_libevent_entry *find_bridge_entry(const fdic_libevent *bridge, uint32_t id) {
     void *value = nullptr;
     int found = 0;
     LOG_STATUS(ht_lookup(bridge->entries, &id, sizeof id, &found, nullptr, nullptr, &value));
@@ -105,7 +105,7 @@ fdic_libevent_entry *find_entry(const fdic_libevent *bridge, uint32_t id) {
 
 // --- From the loop
 
-lc_status read_fired(int fd, const fdic_libevent_entry *entry) {
+lc_status call_read_function(int fd, const fdic_libevent_entry *entry) {
     const fdic_event *interest = &entry->interest;
     CHECK_CONDITION(interest->fd == fd);
     if (interest->has_fd && interest->want_read)
@@ -113,7 +113,7 @@ lc_status read_fired(int fd, const fdic_libevent_entry *entry) {
             interest->read_function(fd, FDIC_READABLE, interest->user_data, interest->read_argument));
     return LC_OK;
 }
-lc_status write_fired(int fd, const fdic_libevent_entry *entry) {
+lc_status call_write_function(int fd, const fdic_libevent_entry *entry) {
     const fdic_event *interest = &entry->interest;
     CHECK_CONDITION(interest->fd == fd);
     if (interest->has_fd && interest->want_write)
@@ -121,7 +121,7 @@ lc_status write_fired(int fd, const fdic_libevent_entry *entry) {
             interest->write_function(fd, FDIC_WRITABLE, interest->user_data, interest->write_argument));
     return LC_OK;
 }
-lc_status timer_fired(int fd, const fdic_libevent_entry *entry) {
+lc_status call_timer_function(int fd, const fdic_libevent_entry *entry) {
     const fdic_event *interest = &entry->interest;
     CHECK_CONDITION(interest->has_timer);
     CHECK_STATUS(
@@ -129,14 +129,14 @@ lc_status timer_fired(int fd, const fdic_libevent_entry *entry) {
     return LC_OK;
 }
 
-lc_status run_fired(int fd, short flags, const fdic_libevent_entry *entry) {
+lc_status call_interest(int fd, short flags, const fdic_libevent_entry *entry) {
     // A failure ends this round of calls; each has been logged where it was found.
     if (flags & LOOP_READ)
-        CHECK_QUIET(read_fired(fd, entry));
+        CHECK_QUIET(call_read_function(fd, entry));
     if (flags & LOOP_WRITE)
-        CHECK_QUIET(write_fired(fd, entry));
+        CHECK_QUIET(call_write_function(fd, entry));
     if (flags & LOOP_TIMEOUT)
-        CHECK_QUIET(timer_fired(fd, entry));
+        CHECK_QUIET(call_timer_function(fd, entry));
     return LC_OK;
 }
 
@@ -151,13 +151,13 @@ void fdic_libevent_handler(int fd, short flags, void *data) {
     }
     if (!(flags & (LOOP_READ | LOOP_WRITE | LOOP_TIMEOUT)))
         LC_LOG(LC_LOG_WARNING, "Called with event_type %d", flags);
-    (void)run_fired(fd, flags, &entry);
+    (void)call_interest(fd, flags, &entry);
 }
 
 // --- Into the loop
 
-lc_status drop_interest(fdic_libevent *bridge, const fdic_event *change) {
-    fdic_libevent_entry *entry = find_entry(bridge, change->id);
+lc_status remove_interest(fdic_libevent *bridge, const fdic_event *change) {
+    fdic_libevent_entry *entry = find_bridge_entry(bridge, change->id);
     if (!entry)
         return LC_OK;
     // What the handler gets is read before the entry is freed.
@@ -170,13 +170,13 @@ lc_status drop_interest(fdic_libevent *bridge, const fdic_event *change) {
     return LC_OK;
 }
 
-void free_entry(fdic_libevent_entry *entry) {
+void free_bridge_entry(fdic_libevent_entry *entry) {
     loop_event_free(&entry->event);
     free(entry);
 }
 
-lc_status make_entry(fdic_libevent *bridge, uint32_t id, fdic_libevent_entry **out) {
-    owned<fdic_libevent_entry, free_entry> entry(
+lc_status new_bridge_entry(fdic_libevent *bridge, uint32_t id, fdic_libevent_entry **out) {
+    owned<fdic_libevent_entry, free_bridge_entry> entry(
         static_cast<fdic_libevent_entry *>(calloc(1, sizeof(fdic_libevent_entry))));
     CHECK_NULL(entry.pointer);
     entry.pointer->loop = bridge->loop;
@@ -191,16 +191,17 @@ lc_status make_entry(fdic_libevent *bridge, uint32_t id, fdic_libevent_entry **o
     return LC_OK;
 }
 
-lc_status take_interest(fdic_libevent *bridge, const fdic_event *change) {
-    if (!find_entry(bridge, change->id)) {
+lc_status apply_interest(fdic_libevent *bridge, const fdic_event *change) {
+    if (!find_bridge_entry(bridge, change->id)) {
         fdic_libevent_entry *made = nullptr;
-        CHECK_STATUS(make_entry(bridge, change->id, &made));
+        CHECK_STATUS(new_bridge_entry(bridge, change->id, &made));
         made->interest = *change;
         if (change->has_fd && bridge->open_handler)
             CHECK_STATUS(
                 bridge->open_handler(change->fd, FDIC_FD_OPENED, change->user_data, bridge->open_data));
     }
-    fdic_libevent_entry *entry = find_entry(bridge, change->id);
+    // The open handler may have changed the table, so the entry is looked up again.
+    fdic_libevent_entry *entry = find_bridge_entry(bridge, change->id);
     if (!entry)
         return LC_OK; // the open handler has removed it
     entry->interest = *change;
@@ -214,23 +215,23 @@ lc_status take_interest(fdic_libevent *bridge, const fdic_event *change) {
     return LC_OK;
 }
 
-lc_status carry_out(fdic_libevent *bridge, const fdic_event_array *changes) {
+lc_status apply_changes(fdic_libevent *bridge, const fdic_event_array *changes) {
     // One failure doesn't keep the other changes from being applied; the first is returned.
     lc_status result = LC_OK;
     for (uint32_t i = 0; i < fdic_event_array_length_quick(changes); i++) {
         const fdic_event *change = fdic_event_array_get_quick(changes, i);
         const lc_status status =
-            change->active ? take_interest(bridge, change) : drop_interest(bridge, change);
+            change->active ? apply_interest(bridge, change) : remove_interest(bridge, change);
         LOG_STATUS(status);
         result = result ? result : status;
     }
     return result;
 }
 
-void carry_out_posted(loop_post *post, int carry) {
+void apply_posted_changes(loop_post *post, int carry) {
     auto *posted = reinterpret_cast<posted_changes *>(post);
     if (carry)
-        (void)carry_out(posted->bridge, posted->changes);
+        (void)apply_changes(posted->bridge, posted->changes);
     (void)fdic_event_array_free(&posted->changes);
     free(posted);
 }
@@ -243,7 +244,7 @@ lc_status post_changes(fdic_libevent *bridge, const fdic_event_array *changes) {
         free(posted);
     CHECK_STATUS(status);
     posted->post.poster = bridge;
-    posted->post.function = carry_out_posted;
+    posted->post.function = apply_posted_changes;
     posted->bridge = bridge;
     loop_post_work(bridge->loop, &posted->post);
     return LC_OK;
@@ -259,6 +260,7 @@ lc_status fdic_libevent_callback(const fdic_event_array *changes, void *data) {
         CHECK_STATUS(post_changes(bridge, changes));
         return LC_OK;
     }
+    // Changes that other threads have posted are older than these.
     loop_run_posted(bridge->loop);
-    return carry_out(bridge, changes);
+    return apply_changes(bridge, changes);
 }

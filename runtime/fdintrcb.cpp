@@ -54,9 +54,10 @@ lc_status fdic_deinit(fdic **inout) {
 
 namespace {
 
-fdic_event *find(const fdic_event_array *events, uint32_t id, uint32_t *out_index) {
+fdic_event *find_interest(const fdic_event_array *events, uint32_t id, uint32_t *out_index) {
     fdic_event key{};
     key.id = id;
+    // Both arrays are sorted by id, since new ids only increase.
     if (fdic_event_array_binary_search(events, &key, out_index) != LC_OK)
         return nullptr;
     return fdic_event_array_get_quick(events, *out_index);
@@ -64,12 +65,12 @@ fdic_event *find(const fdic_event_array *events, uint32_t id, uint32_t *out_inde
 
 // --- The compare step
 
-bool is_usable(const fdic_event *event) {
+bool can_be_watched(const fdic_event *event) {
     return (event->has_fd && event->fd >= 0) || (event->has_timer && event->delay >= 0);
 }
 
 // Whether the callback knows the interest as it is.
-bool is_told(const fdic_event *event, const fdic_event *reported) {
+bool is_reported(const fdic_event *event, const fdic_event *reported) {
     if (!reported)
         return !event->active; // removed before it was ever reported
     if (event->active != reported->active || event->has_fd != reported->has_fd ||
@@ -81,34 +82,34 @@ bool is_told(const fdic_event *event, const fdic_event *reported) {
     return !event->has_timer || event->delay == reported->delay;
 }
 
-lc_status report(fdic *context, const fdic_event *event) {
+lc_status update_reported(fdic *context, const fdic_event *event) {
     uint32_t index = 0;
     if (event->active) {
         CHECK_STATUS(fdic_event_array_insert_sorted(context->reported, event));
-    } else if (find(context->reported, event->id, &index)) {
+    } else if (find_interest(context->reported, event->id, &index)) {
         CHECK_STATUS(fdic_event_array_delete(context->reported, index));
     }
     return LC_OK;
 }
 
-lc_status compare(fdic *context, bool all, fdic_event_array **out) {
+lc_status collect_changes(fdic *context, bool all, fdic_event_array **out) {
     owned_events result;
     CHECK_STATUS(fdic_event_array_new(&result.pointer));
     const uint32_t count = fdic_event_array_length_quick(context->current);
     for (uint32_t i = 0; i < count; i++) {
         fdic_event *event = fdic_event_array_get_quick(context->current, i);
         uint32_t index = 0;
-        const fdic_event *reported = find(context->reported, event->id, &index);
-        if (!is_usable(event))
+        const fdic_event *reported = find_interest(context->reported, event->id, &index);
+        if (!can_be_watched(event))
             event->active = 0;
-        if (!all && is_told(event, reported))
+        if (!all && is_reported(event, reported))
             continue;
         if (event->id == 0) {
             LC_LOG(LC_LOG_ERR, "Invalid event for fd %d timeout %ld: 0 id", event->fd,
                    static_cast<long>(event->delay));
             continue;
         }
-        CHECK_STATUS(report(context, event));
+        CHECK_STATUS(update_reported(context, event));
         CHECK_STATUS(fdic_event_array_insert_sorted(result.pointer, event));
     }
     // From the end, so that the positions that are still to come don't change.
@@ -119,9 +120,9 @@ lc_status compare(fdic *context, bool all, fdic_event_array **out) {
     return LC_OK;
 }
 
-lc_status tell_changes(fdic *context) {
+lc_status report_changes(fdic *context) {
     owned_events changes;
-    CHECK_STATUS(compare(context, false, &changes.pointer));
+    CHECK_STATUS(collect_changes(context, false, &changes.pointer));
     if (fdic_event_array_length_quick(changes.pointer) && context->callback)
         CHECK_STATUS(context->callback(changes.pointer, context->user_data));
     return LC_OK;
@@ -129,12 +130,12 @@ lc_status tell_changes(fdic *context) {
 
 // --- Changes
 
-lc_status add(fdic *context, fdic_event *event, int32_t *out_id) {
+lc_status add_interest(fdic *context, fdic_event *event, int32_t *out_id) {
     event->context = context;
     event->id = context->next_id++;
     CHECK_STATUS(fdic_event_array_insert_sorted(context->current, event));
     *out_id = static_cast<int32_t>(event->id);
-    CHECK_STATUS(tell_changes(context));
+    CHECK_STATUS(report_changes(context));
     return LC_OK;
 }
 
@@ -158,7 +159,7 @@ lc_status fdic_event_add_fd(fdic *context, int32_t fd, int32_t want_read, int32_
     event.write_function = write_function;
     event.write_argument = write_argument;
     event.delay = -1;
-    CHECK_STATUS(add(context, &event, out_id));
+    CHECK_STATUS(add_interest(context, &event, out_id));
     return LC_OK;
 }
 
@@ -176,7 +177,7 @@ lc_status fdic_event_add_timer(fdic *context, int64_t delay_ms, void *user_data,
     event.timer_function = timer_function;
     event.timer_argument = timer_argument;
     LC_LOG(LC_LOG_INFO, "EVENT: adding for %p: %ld ms", user_data, static_cast<long>(event.delay));
-    CHECK_STATUS(add(context, &event, out_id));
+    CHECK_STATUS(add_interest(context, &event, out_id));
     return LC_OK;
 }
 
@@ -186,7 +187,7 @@ namespace {
 lc_status find_current(const fdic *context, int32_t id, const char *what, fdic_event **out) {
     uint32_t index = 0;
     CHECK_NULL(context);
-    *out = id > 0 ? find(context->current, static_cast<uint32_t>(id), &index) : nullptr;
+    *out = id > 0 ? find_interest(context->current, static_cast<uint32_t>(id), &index) : nullptr;
     if (*out)
         return LC_OK;
     LC_LOG(LC_LOG_WARNING, "Asked to %s with bad id %d", what, id);
@@ -200,7 +201,7 @@ lc_status fdic_event_update_fd(fdic *context, int32_t id, int32_t want_read, int
     CHECK_QUIET(find_current(context, id, "update event fd", &event));
     event->want_read = want_read;
     event->want_write = want_write;
-    CHECK_STATUS(tell_changes(context));
+    CHECK_STATUS(report_changes(context));
     return LC_OK;
 }
 
@@ -208,7 +209,7 @@ lc_status fdic_event_delete_fd(fdic *context, int32_t id) {
     fdic_event *event = nullptr;
     CHECK_QUIET(find_current(context, id, "update event fd", &event));
     event->active = 0;
-    CHECK_STATUS(tell_changes(context));
+    CHECK_STATUS(report_changes(context));
     return LC_OK;
 }
 
@@ -216,7 +217,7 @@ lc_status fdic_event_update_timer(fdic *context, int32_t id, int64_t delay_ms) {
     fdic_event *event = nullptr;
     CHECK_QUIET(find_current(context, id, "update event timer", &event));
     event->delay = delay_ms < 0 ? -1 : delay_ms;
-    CHECK_STATUS(tell_changes(context));
+    CHECK_STATUS(report_changes(context));
     return LC_OK;
 }
 
@@ -225,7 +226,7 @@ lc_status fdic_event_delete_timer(fdic *context, int32_t id) {
     CHECK_QUIET(find_current(context, id, "delete event timer", &event));
     LC_LOG(LC_LOG_INFO, "EVENT: deleting for %p: %ld ms", event->user_data, static_cast<long>(event->delay));
     event->active = 0;
-    CHECK_STATUS(tell_changes(context));
+    CHECK_STATUS(report_changes(context));
     return LC_OK;
 }
 
@@ -233,6 +234,6 @@ lc_status fdic_events_query(fdic *context, fdic_event_array **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(context);
-    CHECK_STATUS(compare(context, true, out));
+    CHECK_STATUS(collect_changes(context, true, out));
     return LC_OK;
 }

@@ -82,10 +82,10 @@ ht_entry **new_buckets(uint32_t count) {
     return static_cast<ht_entry **>(calloc(count, sizeof(ht_entry *)));
 }
 
-void release_record(ht *table) {
+void free_table_record(ht *table) {
     free(table);
 }
-void release_entry(ht_entry *entry) {
+void free_entry_record(ht_entry *entry) {
     free(entry);
 }
 
@@ -98,7 +98,7 @@ lc_status ht_new(ht **out, const ht_options *options) {
     ht_default_options(&defaults);
     if (!options)
         options = &defaults;
-    owned<ht, release_record> made(static_cast<ht *>(calloc(1, sizeof(ht))));
+    owned<ht, free_table_record> made(static_cast<ht *>(calloc(1, sizeof(ht))));
     ht *table = made.pointer;
     CHECK_NULL(table);
     table->buckets = new_buckets(ht_table_size_initial);
@@ -117,7 +117,7 @@ lc_status ht_new(ht **out, const ht_options *options) {
 
 namespace {
 
-void resize(ht *table, uint32_t bucket_count) {
+void set_bucket_count(ht *table, uint32_t bucket_count) {
     ht_entry **buckets = new_buckets(bucket_count);
     if (!buckets)
         return;
@@ -137,11 +137,11 @@ void resize(ht *table, uint32_t bucket_count) {
 }
 
 // Grows or shrinks the table if its load is out of bounds.
-void fit(ht *table) {
+void adapt_bucket_count(ht *table) {
     const uint64_t entries = table->entry_count;
     uint32_t buckets = table->bucket_count;
     if (entries > uint64_t{ht_table_resize_growth_load_factor} * buckets && buckets < ht_table_size_max) {
-        resize(table, std::min(buckets * ht_table_resize_factor, ht_table_size_max));
+        set_bucket_count(table, std::min(buckets * ht_table_resize_factor, ht_table_size_max));
     } else if (buckets >
                std::max<uint64_t>(ht_table_resize_shrink_load_factor * entries, ht_table_size_initial)) {
         uint32_t before;
@@ -150,12 +150,12 @@ void fit(ht *table) {
             before = buckets;
             buckets /= ht_table_resize_factor;
         } while (before >= 128 && ht_table_resize_shrink_load_factor * entries < buckets);
-        resize(table, std::max(buckets, ht_table_size_initial));
+        set_bucket_count(table, std::max(buckets, ht_table_size_initial));
     }
 }
 
 // Unlinks one entry and frees it. It is gone even if its free function fails, which gives LC_GENERIC.
-lc_status drop(ht *table, ht_entry **link) {
+lc_status delete_entry(ht *table, ht_entry **link) {
     ht_entry *entry = *link;
     *link = entry->next;
     table->entry_count--;
@@ -166,11 +166,11 @@ lc_status drop(ht *table, ht_entry **link) {
     return status == LC_OK ? LC_OK : LC_GENERIC;
 }
 
-lc_status drop_all(ht *table) {
+lc_status delete_all_entries(ht *table) {
     lc_status result = LC_OK;
     for (uint32_t i = 0; i < table->bucket_count; i++) {
         while (table->buckets[i]) {
-            const lc_status status = drop(table, &table->buckets[i]);
+            const lc_status status = delete_entry(table, &table->buckets[i]);
             if (status != LC_OK)
                 result = status;
         }
@@ -182,8 +182,8 @@ lc_status drop_all(ht *table) {
 
 lc_status ht_empty(ht *table) {
     CHECK_NULL(table);
-    const lc_status status = drop_all(table);
-    fit(table);
+    const lc_status status = delete_all_entries(table);
+    adapt_bucket_count(table);
     CHECK_STATUS(status);
     return LC_OK;
 }
@@ -193,7 +193,7 @@ lc_status ht_free(ht **inout) {
     *inout = nullptr;
     if (!table)
         return LC_OK;
-    const lc_status status = drop_all(table);
+    const lc_status status = delete_all_entries(table);
     free(table->buckets);
     free(table);
     CHECK_STATUS(status);
@@ -204,13 +204,13 @@ lc_status ht_free(ht **inout) {
 
 namespace {
 
-uint32_t length_of(const void *key, int32_t key_length) {
+uint32_t key_bytes(const void *key, int32_t key_length) {
     return key_length < 0 ? static_cast<uint32_t>(strlen(static_cast<const char *>(key)))
                           : static_cast<uint32_t>(key_length);
 }
 
 // The pointer that points to this key's entry, or the null pointer at the end of its chain.
-ht_entry **find(const ht *table, const void *key, uint32_t length) {
+ht_entry **find_link(const ht *table, const void *key, uint32_t length) {
     ht_entry **link = &table->buckets[table->hash_function(key, length) % table->bucket_count];
     while (*link && !table->key_equal_function((*link)->key, (*link)->key_length, key, length))
         link = &(*link)->next;
@@ -222,10 +222,10 @@ ht_entry **find(const ht *table, const void *key, uint32_t length) {
 lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value) {
     CHECK_NULL(table);
     CHECK_NULL(key);
-    const uint32_t length = length_of(key, key_length);
-    if (table->refuse_duplicates && *find(table, key, length))
+    const uint32_t length = key_bytes(key, key_length);
+    if (table->refuse_duplicates && *find_link(table, key, length))
         return LC_EXISTS;
-    owned<ht_entry, release_entry> entry(static_cast<ht_entry *>(calloc(1, sizeof(ht_entry))));
+    owned<ht_entry, free_entry_record> entry(static_cast<ht_entry *>(calloc(1, sizeof(ht_entry))));
     CHECK_NULL(entry.pointer);
     *entry.pointer = {const_cast<void *>(key), length, value, nullptr};
     // Deletes an old entry of this key. This may resize the table, so the place is looked up only afterwards.
@@ -233,9 +233,9 @@ lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value)
     if (table->insert_function)
         CHECK_STATUS(table->insert_function(key, length, value, table->user_word, &entry.pointer->key,
                                             &entry.pointer->value));
-    *find(table, key, length) = entry.take(); // the key is not there, so this is the end of its chain
+    *find_link(table, key, length) = entry.take(); // the key is not there, so this is the end of its chain
     table->entry_count++;
-    fit(table);
+    adapt_bucket_count(table);
     return LC_OK;
 }
 lc_status ht_lookup(const ht *table, const void *key, int32_t key_length, int *out_found, void **out_key,
@@ -250,7 +250,7 @@ lc_status ht_lookup(const ht *table, const void *key, int32_t key_length, int *o
         *out_value = nullptr;
     CHECK_NULL(table);
     CHECK_NULL(key);
-    const ht_entry *entry = *find(table, key, length_of(key, key_length));
+    const ht_entry *entry = *find_link(table, key, key_bytes(key, key_length));
     if (!entry)
         return LC_OK;
     if (out_found)
@@ -266,11 +266,11 @@ lc_status ht_lookup(const ht *table, const void *key, int32_t key_length, int *o
 lc_status ht_delete(ht *table, const void *key, int32_t key_length) {
     CHECK_NULL(table);
     CHECK_NULL(key);
-    ht_entry **link = find(table, key, length_of(key, key_length));
+    ht_entry **link = find_link(table, key, key_bytes(key, key_length));
     if (!*link)
         return LC_OK;
-    const lc_status status = drop(table, link);
-    fit(table);
+    const lc_status status = delete_entry(table, link);
+    adapt_bucket_count(table);
     CHECK_STATUS(status);
     return LC_OK;
 }

@@ -68,8 +68,9 @@ lc_status create_state_lock() {
     return LC_OK;
 }
 
-lc_status init_locked(const char *process_name, const char *prefix, uint32_t default_flags,
-                      uint32_t default_component, int32_t max_level, int32_t facility, uint8_t destinations) {
+lc_status init_with_lock(const char *process_name, const char *prefix, uint32_t default_flags,
+                         uint32_t default_component, int32_t max_level, int32_t facility,
+                         uint8_t destinations) {
     const cancel_off_guard uncancelled;
     const lc_lock_guard guard(G_log_state_lock);
     const bool first = G_log_state == nullptr;
@@ -79,6 +80,7 @@ lc_status init_locked(const char *process_name, const char *prefix, uint32_t def
     if (!state)
         return LC_NULL;
     const int32_t options = default_flags & LC_LOG_FLAG_NO_PID ? LOG_NDELAY : LOG_PID | LOG_NDELAY;
+    // The connection is kept if nothing that it depends on has changed.
     const bool reopen = first ||
                         strncmp(state->process_name, process_name, sizeof state->process_name - 1) != 0 ||
                         state->facility != facility || state->openlog_options != options;
@@ -131,19 +133,20 @@ lc_status lc_log_init(const char *process_name, const char *prefix, uint32_t def
     CHECK_NULL(process_name);
     if (create_state_lock() != LC_OK)
         return LC_GENERIC;
-    CHECK_STATUS(init_locked(process_name, prefix, default_flags, default_component, max_level, facility,
-                             destinations));
+    CHECK_STATUS(init_with_lock(process_name, prefix, default_flags, default_component, max_level, facility,
+                                destinations));
     return LC_OK;
 }
 
 namespace {
 
-lc_status close_locked() {
+lc_status close_with_lock() {
     const cancel_off_guard uncancelled;
     const lc_lock_guard guard(G_log_state_lock);
     lc_log_state *state = G_log_state;
     if (!state)
         return LC_NULL;
+    // The state is unlinked before it is freed, so that a line logged by the close finds none.
     G_log_state = nullptr;
     syslog_socket_close(&state->log_daemon);
     free(state);
@@ -153,7 +156,7 @@ lc_status close_locked() {
 } // namespace
 
 lc_status lc_log_close() {
-    return G_log_state_lock ? close_locked() : LC_NULL;
+    return G_log_state_lock ? close_with_lock() : LC_NULL;
 }
 
 const char *lc_log_get_lls_process_name() {
@@ -172,6 +175,7 @@ lc_status init_unnamed() {
         name[count] = '\0';
         fclose(file);
     }
+    // cmdline has NULs between the arguments, so this is only the first, the program's path.
     const char *slash = strrchr(name, '/');
     char full[96];
     snprintf(full, sizeof full, "%s-UNINIT", name[0] ? (slash ? slash + 1 : name) : "UNKNOWN");
@@ -196,7 +200,7 @@ struct line_format {
     size_t used;
 };
 
-void add(line_format *format, const char *pattern, ...) __attribute__((format(printf, 2, 3)));
+void append_text(line_format *format, const char *pattern, ...) __attribute__((format(printf, 2, 3)));
 // Removes an incomplete conversion from the end of a format that was cut.
 void drop_half_conversion(line_format *format) {
     const char *const end = format->text + format->used;
@@ -217,7 +221,7 @@ void drop_half_conversion(line_format *format) {
     }
 }
 
-void add(line_format *format, const char *pattern, ...) {
+void append_text(line_format *format, const char *pattern, ...) {
     va_list arguments;
     va_start(arguments, pattern);
     const int length =
@@ -231,7 +235,7 @@ void add(line_format *format, const char *pattern, ...) {
     }
 }
 
-void add_stamp(line_format *format, const log_line *line) {
+void append_stamp(line_format *format, const log_line *line) {
     // The finest stamp that is asked for is used, so it comes first.
     static const struct {
         uint32_t flag;
@@ -251,18 +255,18 @@ void add_stamp(line_format *format, const log_line *line) {
         if (!(line->flags & form.flag))
             continue;
         if (form.divisor == 0)
-            add(format, "[%ld] ", seconds);
+            append_text(format, "[%ld] ", seconds);
         else
-            add(format, "[%ld.%0*ld] ", seconds, form.digits,
-                static_cast<long>(line->stamp.tv_usec) / form.divisor);
+            append_text(format, "[%ld.%0*ld] ", seconds, form.digits,
+                        static_cast<long>(line->stamp.tv_usec) / form.divisor);
         return;
     }
 }
 
-void add_thread_mark(line_format *format, const log_line *line) {
+void append_thread_id(line_format *format, const log_line *line) {
     if (!lc_is_multithreaded || (line->flags & LC_LOG_FLAG_NO_THREAD))
         return;
-    add(format, "TID %lu: ", static_cast<unsigned long>(syscall(SYS_gettid)));
+    append_text(format, "TID %lu: ", static_cast<unsigned long>(syscall(SYS_gettid)));
 }
 
 const char *component_name(uint32_t component) {
@@ -272,17 +276,17 @@ const char *component_name(uint32_t component) {
 }
 
 void build_body(line_format *body, const log_line *line, const char *format) {
-    add_thread_mark(body, line);
-    add_stamp(body, line);
-    add(body, "[%s.%s]: ", component_name(line->component),
-        lc_enum_to_string_quiet(lc_log_level_upper_table, line->level));
+    append_thread_id(body, line);
+    append_stamp(body, line);
+    append_text(body, "[%s.%s]: ", component_name(line->component),
+                lc_enum_to_string_quiet(lc_log_level_upper_table, line->level));
     if (line->state->prefix[0])
-        add(body, "%s: ", line->state->prefix);
+        append_text(body, "%s: ", line->state->prefix);
     if (line->flags & LC_LOG_FLAG_POSITION)
-        add(body, "%s(), %s:%d, build %s: %s\n", line->function ? line->function : "",
-            line->file ? line->file : "", line->line, WCCP_BUILD, format);
+        append_text(body, "%s(), %s:%d, build %s: %s\n", line->function ? line->function : "",
+                    line->file ? line->file : "", line->line, WCCP_BUILD, format);
     else
-        add(body, "%s\n", format);
+        append_text(body, "%s\n", format);
 }
 
 void build_header(line_format *full, const log_line *line) {
@@ -292,14 +296,14 @@ void build_header(line_format *full, const log_line *line) {
     char text[32] = "";
     const time_t seconds = line->stamp.tv_sec;
     ctime_r(&seconds, text);
-    add(full, "%.15s %s ", strlen(text) > 4 ? text + 4 : text, state->host_name);
+    append_text(full, "%.15s %s ", strlen(text) > 4 ? text + 4 : text, state->host_name);
     if (line->flags & LC_LOG_FLAG_NO_PID)
-        add(full, "%s: ", state->process_name);
+        append_text(full, "%s: ", state->process_name);
     else
-        add(full, "%s[%d]: ", state->process_name, static_cast<int>(state->process_id));
+        append_text(full, "%s[%d]: ", state->process_name, static_cast<int>(state->process_id));
 }
 
-void take_stamp(log_line *line, const timeval *now) {
+void set_stamp(log_line *line, const timeval *now) {
     lc_log_state *state = line->state;
     const bool relative = (line->flags & LC_LOG_FLAG_RELATIVE) != 0;
     line->stamp = *now;
@@ -311,8 +315,9 @@ void take_stamp(log_line *line, const timeval *now) {
         timersub(now, &state->relative_base, &line->stamp);
 }
 
-void tell_lost_lines(log_line *line) {
+void report_lost_lines(log_line *line) {
     errno = 0;
+    // Sent directly, without the head of an ordinary line.
     if (syslog_socket_send(&line->state->log_daemon, LC_LOG_ERR,
                            "messages lost due to non-blocking syslog (count=%d)", lost_lines) != EAGAIN)
         lost_lines = 0;
@@ -320,7 +325,7 @@ void tell_lost_lines(log_line *line) {
 
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wformat-nonliteral"
-void write_out(const log_line *line, const line_format *full, const line_format *body, va_list arguments) {
+void write_line(const log_line *line, const line_format *full, const line_format *body, va_list arguments) {
     static const struct {
         uint8_t destination;
         FILE **stream;
@@ -346,14 +351,14 @@ void write_out(const log_line *line, const line_format *full, const line_format 
 }
 #pragma GCC diagnostic pop
 
-lc_status log_locked(log_line *line, int saved_errno, const char *format, va_list arguments) {
+lc_status log_with_lock(log_line *line, int saved_errno, const char *format, va_list arguments) {
     lc_log_state *state = G_log_state;
     if (!state)
         return LC_GENERIC;
     line->state = state;
     state->calls++;
     if (lost_lines > 0)
-        tell_lost_lines(line);
+        report_lost_lines(line);
     timeval now;
     gettimeofday(&now, nullptr);
     log_poll_level_link(state, now.tv_sec);
@@ -364,17 +369,17 @@ lc_status log_locked(log_line *line, int saved_errno, const char *format, va_lis
     if (!(line->flags & LC_LOG_FLAG_EXACT))
         line->flags |= state->default_flags;
     line->component |= state->default_component;
-    take_stamp(line, &now);
+    set_stamp(line, &now);
     if (log_poll_time_zone(state, now.tv_sec))
         (void)lt_timezone_handle_changed();
     line_format full = {}, body = {};
     build_header(&full, line);
     build_body(&body, line, format);
     if (state->time_header)
-        add(&full, "%s", body.text);
+        append_text(&full, "%s", body.text);
     // The functions above may have changed errno, and the caller's format may contain "%m".
     errno = saved_errno;
-    write_out(line, &full, &body, arguments);
+    write_line(line, &full, &body, arguments);
     state->lines++;
     state->last_line = now;
     return LC_OK;
@@ -404,7 +409,7 @@ lc_status lc_log_internal(const char *function, const char *file, int line, uint
     va_list arguments;
     va_start(arguments, format);
     inside_the_log = true;
-    const lc_status status = log_locked(&entry, saved_errno, format, arguments);
+    const lc_status status = log_with_lock(&entry, saved_errno, format, arguments);
     va_end(arguments);
     inside_the_log = false;
     (void)lc_lock_unlock(G_log_state_lock);

@@ -88,7 +88,7 @@ void log_take_system_level(lc_log_state *state) {
 namespace {
 
 // `look`: stat or lstat.
-timespec changed_at(const char *path, int (*look)(const char *, struct stat *)) {
+timespec modification_time(const char *path, int (*look)(const char *, struct stat *)) {
     struct stat status = {};
     return look(path, &status) == 0 ? status.st_mtim : timespec{};
 }
@@ -99,10 +99,10 @@ bool same_time(const timespec &a, const timespec &b) {
 } // namespace
 
 timespec log_level_link_time() {
-    return changed_at(LEVEL_LINK, lstat);
+    return modification_time(LEVEL_LINK, lstat);
 }
 timespec log_time_zone_time() {
-    return changed_at(TIME_ZONE_FILE, stat);
+    return modification_time(TIME_ZONE_FILE, stat);
 }
 
 namespace {
@@ -110,11 +110,11 @@ namespace {
 bool has_console(const lc_log_state *state) {
     return state->time_header != 0;
 }
-bool overridden(const lc_log_state *state) {
+bool is_overridden(const lc_log_state *state) {
     return state->system_override && state->class_override;
 }
 
-void make_current(lc_log_state *state, uint8_t level) {
+void set_current_level(lc_log_state *state, uint8_t level) {
     state->current_level = level;
     const int32_t own = lc_log_get_daemon_log_level();
     syslog_set_mask(own != -1 ? own : level);
@@ -130,8 +130,8 @@ void log_poll_level_link(lc_log_state *state, time_t now) {
     const timespec changed = log_level_link_time();
     if (changed.tv_sec != 0 && !same_time(changed, state->level_link_changed)) {
         log_take_system_level(state);
-        make_current(state,
-                     overridden(state) ? state->override_level : static_cast<uint8_t>(state->system_level));
+        set_current_level(state, is_overridden(state) ? state->override_level
+                                                      : static_cast<uint8_t>(state->system_level));
     }
     state->level_link_changed = changed;
 }
@@ -158,15 +158,15 @@ struct locked_state {
     lc_log_state *const state;
 };
 
-lc_status set_system_level(int32_t level) {
+lc_status set_system_level_with_lock(int32_t level) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
     if (has_console(log.state))
         return LC_OK;
     log.state->system_level = static_cast<int8_t>(level);
-    if (!overridden(log.state))
-        make_current(log.state, static_cast<uint8_t>(level));
+    if (!is_overridden(log.state))
+        set_current_level(log.state, static_cast<uint8_t>(level));
     return LC_OK;
 }
 
@@ -175,7 +175,7 @@ lc_status set_system_level(int32_t level) {
 lc_status lc_log_set_max_log_level(const char *name) {
     int32_t level = 0;
     CHECK_QUIET(lc_string_to_enum(lc_log_level_table, name, &level));
-    CHECK_STATUS(set_system_level(level));
+    CHECK_STATUS(set_system_level_with_lock(level));
     return LC_OK;
 }
 
@@ -199,18 +199,18 @@ int32_t lc_log_get_daemon_log_level() {
 namespace {
 
 // Makes the override level current, or the system level.
-void settle_overrides(lc_log_state *state, bool overrides) {
+void apply_override(lc_log_state *state, bool overrides) {
     state->current_level = overrides ? state->override_level : static_cast<uint8_t>(state->system_level);
     if (!has_console(state))
-        make_current(state, state->current_level);
+        set_current_level(state, state->current_level);
 }
 
-lc_status switch_override(int32_t system_wide, int32_t enable) {
+lc_status switch_override_with_lock(int32_t system_wide, int32_t enable) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
     (system_wide ? log.state->system_override : log.state->class_override) = enable;
-    settle_overrides(log.state, overridden(log.state));
+    apply_override(log.state, is_overridden(log.state));
     // Turning the class's switch off leaves an override level that changes nothing when it is turned on
     // again.
     if (!system_wide && !enable)
@@ -221,23 +221,23 @@ lc_status switch_override(int32_t system_wide, int32_t enable) {
 } // namespace
 
 lc_status lc_log_enable_override_log_level(int32_t system_wide, int32_t enable) {
-    CHECK_STATUS(switch_override(system_wide, enable));
+    CHECK_STATUS(switch_override_with_lock(system_wide, enable));
     return LC_OK;
 }
 
 namespace {
 
 // -1 means the system level, and turns the class's switch off.
-lc_status set_override_level(int32_t level) {
+lc_status set_override_level_with_lock(int32_t level) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
-    const bool counted = overridden(log.state);
+    const bool counted = is_overridden(log.state);
     log.state->override_level = static_cast<uint8_t>(level == -1 ? log.state->system_level : level);
     if (level == -1)
         log.state->class_override = 0;
     if (counted)
-        settle_overrides(log.state, overridden(log.state));
+        apply_override(log.state, is_overridden(log.state));
     return LC_OK;
 }
 
@@ -248,13 +248,13 @@ lc_status lc_log_set_override_log_level(const char *name) {
     int32_t level = 0;
     if (lc_string_to_enum(lc_log_level_table, name, &level) != LC_OK)
         level = -1;
-    CHECK_STATUS(set_override_level(level));
+    CHECK_STATUS(set_override_level_with_lock(level));
     return LC_OK;
 }
 
 namespace {
 
-lc_status save_levels(lc_log_levels *out) {
+lc_status save_levels_with_lock(lc_log_levels *out) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
@@ -268,13 +268,13 @@ lc_status save_levels(lc_log_levels *out) {
 lc_status lc_log_save_levels(lc_log_levels *out) {
     CHECK_NULL(out);
     *out = {-1, G_log_level, G_log_level, 0, 0};
-    CHECK_STATUS(save_levels(out));
+    CHECK_STATUS(save_levels_with_lock(out));
     return LC_OK;
 }
 
 namespace {
 
-lc_status restore_levels(const lc_log_levels *saved) {
+lc_status restore_levels_with_lock(const lc_log_levels *saved) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
@@ -283,7 +283,7 @@ lc_status restore_levels(const lc_log_levels *saved) {
     log.state->override_level = static_cast<uint8_t>(saved->override);
     log.state->system_override = saved->system_override;
     log.state->class_override = saved->class_override;
-    settle_overrides(log.state, overridden(log.state));
+    apply_override(log.state, is_overridden(log.state));
     return LC_OK;
 }
 
@@ -291,7 +291,7 @@ lc_status restore_levels(const lc_log_levels *saved) {
 
 lc_status lc_log_restore_levels(const lc_log_levels *saved) {
     CHECK_NULL(saved);
-    CHECK_STATUS(restore_levels(saved));
+    CHECK_STATUS(restore_levels_with_lock(saved));
     return LC_OK;
 }
 

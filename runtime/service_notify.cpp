@@ -17,7 +17,7 @@ sockaddr_un manager = {};
 socklen_t manager_length; // 0: no service manager
 int64_t watchdog_ms = -1;
 
-bool parse_number(const char *text, int64_t *out) {
+bool parse_positive(const char *text, int64_t *out) {
     char *end = nullptr;
     *out = strtoll(text, &end, 10);
     return end != text && *end == '\0' && *out > 0;
@@ -38,9 +38,9 @@ void read_socket(const char *path) {
 void read_watchdog(const char *microseconds, const char *pid) {
     int64_t whose = 0, limit = 0;
     // The watchdog may be meant for another process of the service.
-    if (pid && (!parse_number(pid, &whose) || whose != getpid()))
+    if (pid && (!parse_positive(pid, &whose) || whose != getpid()))
         return;
-    if (parse_number(microseconds, &limit) && limit >= 1000)
+    if (parse_positive(microseconds, &limit) && limit >= 1000)
         watchdog_ms = limit / 1000;
 }
 

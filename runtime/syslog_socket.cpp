@@ -94,7 +94,7 @@ int connect_to_daemon(syslog_socket *log) {
 }
 
 // Whether the path now leads to another socket than the one that we are connected to.
-bool path_is_anothers(const syslog_socket *log) {
+bool path_has_changed(const syslog_socket *log) {
     struct stat file = {};
     return stat(LOG_PATH, &file) == 0 && (file.st_dev != log->device || file.st_ino != log->inode);
 }
@@ -127,7 +127,7 @@ bool wait_for_room(syslog_socket *log) {
 }
 
 // Sends a line on the present connection. 0, or an errno.
-int send_whole(syslog_socket *log, const char *line, size_t length) {
+int send_all_bytes(syslog_socket *log, const char *line, size_t length) {
     size_t sent = 0;
     while (sent < length) {
         const ssize_t went = send(log->fd, line + sent, length - sent, MSG_DONTWAIT | MSG_NOSIGNAL);
@@ -157,12 +157,12 @@ int send_line(syslog_socket *log, const char *line, size_t length) {
             if (result != 0)
                 return result;
         }
-        result = send_whole(log, line, length + (log->stream ? 1 : 0));
+        result = send_all_bytes(log, line, length + (log->stream ? 1 : 0));
         if (result == 0) {
             log->patience_ns = SYSLOG_PATIENCE_NS;
             return 0;
         }
-        if (result == EAGAIN && !path_is_anothers(log))
+        if (result == EAGAIN && !path_has_changed(log))
             return result;
         syslog_socket_close(log); // the daemon has ended or been replaced
         failures++;
@@ -171,7 +171,7 @@ int send_line(syslog_socket *log, const char *line, size_t length) {
 }
 
 // The head of a line as syslog(3) writes it, e.g. "<139>Jan  2 03:04:05 wccpd[123]: ".
-size_t write_head(const syslog_socket *log, int32_t level, char *line, size_t size) {
+size_t format_head(const syslog_socket *log, int32_t level, char *line, size_t size) {
     // Month names independent of the locale.
     static const char months[][4] = {"Jan", "Feb", "Mar", "Apr", "May", "Jun",
                                      "Jul", "Aug", "Sep", "Oct", "Nov", "Dec"};
@@ -193,7 +193,7 @@ int syslog_socket_vsend(syslog_socket *log, int32_t level, const char *format, v
     const int saved_errno = errno;
     if (!((1 << (level & LOG_PRIMASK)) & mask))
         return 0;
-    const size_t head = write_head(log, level & LOG_PRIMASK, line, sizeof line);
+    const size_t head = format_head(log, level & LOG_PRIMASK, line, sizeof line);
     va_list again;
     va_copy(again, arguments);
     errno = saved_errno;

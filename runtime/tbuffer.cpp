@@ -23,24 +23,24 @@
 namespace {
 
 // Up to a multiple of 4096 bytes, or of 128 for less than 4096.
-uint64_t rounded(uint64_t size) {
+uint64_t round_size(uint64_t size) {
     const uint64_t mask = size >= tb_size_chunk_size_mask + 1 ? tb_size_chunk_size_mask : tb_size_initial - 1;
     return std::min<uint64_t>((size + mask) & ~mask, tb_size_max);
 }
 
-uint64_t size_for(const tbuffer *buffer, uint64_t need) {
+uint64_t size_for_need(const tbuffer *buffer, uint64_t need) {
     uint64_t size = buffer->size;
     if (size < need) {
         size = uint64_t{std::max(buffer->size, tb_size_initial)} * tb_size_growth_factor;
         size = std::max(size, need);
-        size = rounded(std::min(size, need + tb_size_max_extra_growth));
+        size = round_size(std::min(size, need + tb_size_max_extra_growth));
     }
     if (buffer->auto_shrink && size > (need * 3 + 3) * 2 + 1)
-        size = rounded(need);
+        size = round_size(need);
     return size;
 }
 
-lc_status fit(tbuffer *buffer, uint64_t need) {
+lc_status adapt_buffer_size(tbuffer *buffer, uint64_t need) {
     CHECK_CONDITION(!buffer->constant);
     need = std::max<uint64_t>(need, tb_size_initial);
     if (need > tb_size_max) {
@@ -48,11 +48,12 @@ lc_status fit(tbuffer *buffer, uint64_t need) {
                static_cast<int32_t>(std::min<uint64_t>(need, INT32_MAX)));
         return LC_ASSERTION;
     }
-    const uint64_t size = size_for(buffer, need);
+    const uint64_t size = size_for_need(buffer, need);
     if (size == buffer->size)
         return LC_OK;
     auto *bytes = static_cast<uint8_t *>(realloc(buffer->buffer, size + 1));
     CHECK_NULL(bytes);
+    // All of the new memory, also the byte for the NUL.
     if (size > buffer->size)
         memset(bytes + buffer->size, 0, size + 1 - buffer->size);
     buffer->buffer = bytes;
@@ -60,7 +61,7 @@ lc_status fit(tbuffer *buffer, uint64_t need) {
     return LC_OK;
 }
 
-void ended(tbuffer *buffer, uint32_t length) {
+void end_buffer_at(tbuffer *buffer, uint32_t length) {
     buffer->length = length;
     buffer->buffer[length] = 0;
 }
@@ -79,7 +80,7 @@ lc_status tb_new_size(tbuffer **out, uint32_t size) {
         LC_LOG(LC_LOG_ERR, "maximum size exceeded: %d", static_cast<int32_t>(std::min(size, 0x7fffffffu)));
         return LC_ASSERTION;
     }
-    const uint64_t allocated = rounded(size);
+    const uint64_t allocated = round_size(size);
     buffer.pointer->buffer = static_cast<uint8_t *>(calloc(1, allocated + 1));
     CHECK_NULL(buffer.pointer->buffer);
     buffer.pointer->size = static_cast<uint32_t>(allocated);
@@ -109,12 +110,13 @@ lc_status tb_new_takeover(tbuffer **out, uint8_t **inout_bytes, uint32_t length,
     CHECK_CONDITION(length <= size && size <= tb_size_max);
     owned<tbuffer, tb_release> buffer(static_cast<tbuffer *>(calloc(1, sizeof(tbuffer))));
     CHECK_NULL(buffer.pointer);
+    // Enlarged for the NUL, for which the caller's memory has no room.
     auto *bytes = static_cast<uint8_t *>(realloc(*inout_bytes, size_t{size} + 1));
     CHECK_NULL(bytes);
     *inout_bytes = nullptr;
     buffer.pointer->buffer = bytes;
     buffer.pointer->size = size;
-    ended(buffer.pointer, length);
+    end_buffer_at(buffer.pointer, length);
     *out = buffer.take();
     return LC_OK;
 }
@@ -187,7 +189,7 @@ uint8_t *tb_buf(const tbuffer *buffer) {
 }
 lc_status tb_ensure_size(tbuffer *buffer, uint32_t size) {
     CHECK_NULL(buffer);
-    return size > buffer->size ? fit(buffer, size) : LC_OK;
+    return size > buffer->size ? adapt_buffer_size(buffer, size) : LC_OK;
 }
 lc_status tb_set_length(tbuffer *buffer, uint32_t length) {
     CHECK_NULL(buffer);
@@ -195,8 +197,9 @@ lc_status tb_set_length(tbuffer *buffer, uint32_t length) {
     if (length > buffer->size)
         FAIL_WITH(LC_GENERIC);
     const bool shorter = length < buffer->length;
-    ended(buffer, length);
-    return shorter ? fit(buffer, uint64_t{length} + 1) : LC_OK;
+    end_buffer_at(buffer, length);
+    // Frees memory if auto_shrink is set.
+    return shorter ? adapt_buffer_size(buffer, uint64_t{length} + 1) : LC_OK;
 }
 lc_status tb_clear(tbuffer *buffer) {
     return tb_set_length(buffer, 0);
@@ -223,7 +226,7 @@ lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32
             // Growing may move the buffer, and `bytes` would then point to freed memory.
             const auto *source = static_cast<const uint8_t *>(bytes);
             CHECK_CONDITION(source < buffer->buffer || source >= buffer->buffer + buffer->size);
-            CHECK_QUIET(fit(buffer, end + 1));
+            CHECK_QUIET(adapt_buffer_size(buffer, end + 1));
         }
         if (offset > buffer->length)
             memset(buffer->buffer + buffer->length, 0, offset - buffer->length);
@@ -232,7 +235,7 @@ lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32
     if (count)
         memmove(buffer->buffer + offset, bytes, count);
     if (end > buffer->length)
-        ended(buffer, static_cast<uint32_t>(end));
+        end_buffer_at(buffer, static_cast<uint32_t>(end));
     return LC_OK;
 }
 lc_status tb_append_buf(tbuffer *buffer, const void *bytes, uint32_t count) {
@@ -279,17 +282,17 @@ lc_status tb_get_uint128(const tbuffer *buffer, uint32_t offset, uint8_t out[16]
 
 namespace {
 
-uint32_t in_order(uint32_t number, int swap) {
+uint32_t swap_if(uint32_t number, int swap) {
     return swap ? raw_word(to_be32(number)) : number;
 }
 
-lc_status put_text(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap, const char *text,
-                   uint32_t length, uint32_t *out_written) {
+lc_status put_counted_text(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
+                           const char *text, uint32_t length, uint32_t *out_written) {
     CHECK_CONDITION(length < tb_size_max && offset < tb_size_max);
     const uint32_t counted = length + (add_nul ? 1 : 0);
     uint32_t at = offset;
     if (length_word) {
-        CHECK_STATUS(tb_put_uint32(buffer, at, in_order(counted, swap)));
+        CHECK_STATUS(tb_put_uint32(buffer, at, swap_if(counted, swap)));
         at += 4;
     }
     CHECK_STATUS(tb_put_buf(buffer, at, text, length));
@@ -310,8 +313,8 @@ lc_status tb_put_str(tbuffer *buffer, uint32_t offset, int add_nul, int length_w
     CHECK_NULL(text);
     const size_t bytes = length < 0 ? strlen(text) : static_cast<size_t>(length);
     CHECK_CONDITION(bytes < tb_size_max);
-    return put_text(buffer, offset, add_nul, length_word, swap, text, static_cast<uint32_t>(bytes),
-                    out_written);
+    return put_counted_text(buffer, offset, add_nul, length_word, swap, text, static_cast<uint32_t>(bytes),
+                            out_written);
 }
 lc_status tb_put_tstr(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
                       const tstring *string, uint32_t *out_written) {
@@ -328,7 +331,7 @@ lc_status tb_put_tstr_array(tbuffer *buffer, uint32_t offset, int add_nul, int s
     if (out_written)
         *out_written = 0;
     const uint32_t count = tstr_array_length_quick(array);
-    CHECK_STATUS(tb_put_uint32(buffer, offset, in_order(count, swap)));
+    CHECK_STATUS(tb_put_uint32(buffer, offset, swap_if(count, swap)));
     uint32_t at = offset + 4;
     for (uint32_t i = 0; i < count; i++) {
         uint32_t written = 0;
@@ -347,18 +350,20 @@ lc_status tb_append_tstr_array(tbuffer *buffer, int add_nul, int swap, const tst
 namespace {
 
 // The position and length of the text in the buffer, without its NUL. `out_used` counts from `offset`.
-lc_status find_text(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul, int length_word,
-                    int swap, uint32_t *out_start, uint32_t *out_length, uint32_t *out_used) {
+lc_status find_counted_text(const tbuffer *buffer, uint32_t offset, int32_t length, int expect_nul,
+                            int length_word, int swap, uint32_t *out_start, uint32_t *out_length,
+                            uint32_t *out_used) {
     CHECK_NULL(buffer);
     uint32_t start = offset, counted;
     if (length_word) {
         CHECK_STATUS(tb_get_uint32(buffer, offset, &counted));
-        counted = in_order(counted, swap);
+        counted = swap_if(counted, swap);
         start += 4;
     } else {
         CHECK_CONDITION(offset <= buffer->length);
         counted = length < 0 ? buffer->length - offset : static_cast<uint32_t>(length);
     }
+    // Compared without an addition, which could overflow.
     if (start > buffer->length || counted > buffer->length - start)
         FAIL_WITH(LC_NO_BUFFER_SPACE);
     if (expect_nul)
@@ -377,7 +382,8 @@ lc_status tb_get_str(const tbuffer *buffer, uint32_t offset, int32_t length, int
     CHECK_NULL(out_text);
     *out_text = nullptr;
     uint32_t start = 0, bytes = 0;
-    CHECK_STATUS(find_text(buffer, offset, length, expect_nul, length_word, swap, &start, &bytes, out_used));
+    CHECK_STATUS(
+        find_counted_text(buffer, offset, length, expect_nul, length_word, swap, &start, &bytes, out_used));
     auto *text = static_cast<char *>(malloc(size_t{bytes} + 1));
     CHECK_NULL(text);
     memcpy(text, buffer->buffer + start, bytes);
@@ -404,7 +410,7 @@ lc_status tb_get_tstr_array(const tbuffer *buffer, uint32_t offset, int expect_n
     *out = nullptr;
     uint32_t count = 0;
     CHECK_STATUS(tb_get_uint32(buffer, offset, &count));
-    count = in_order(count, swap);
+    count = swap_if(count, swap);
     uint32_t at = offset + 4;
     if (count > (buffer->length - at) / 4) // each string has a length word
         FAIL_WITH(LC_NO_BUFFER_SPACE);

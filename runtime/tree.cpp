@@ -97,7 +97,7 @@ lc_status tree_free(tree **inout) {
 
 namespace {
 
-tree_node *child_of(const tree_node *node, const char *name) {
+tree_node *find_child(const tree_node *node, const char *name) {
     tree_node key{};
     key.name = const_cast<char *>(name);
     uint32_t index = 0;
@@ -134,7 +134,7 @@ lc_status tree_set_node_value_by_path_str(tree *whole, tree_node *start, const c
     for (uint32_t i = 0; i < tstr_array_length_quick(parts.pointer); i++) {
         const char *name = tstr_array_get_str_quick(parts.pointer, i);
         CHECK_NULL(name);
-        tree_node *next = child_of(node, name);
+        tree_node *next = find_child(node, name);
         if (!next && !create)
             return LC_TREE_NO_PATH;
         if (!next)
@@ -158,9 +158,9 @@ lc_status tree_get_node_by_path_wildcarded(const tree *whole, const tree_node *s
     for (uint32_t i = 0; i < tstr_array_length_quick(parts); i++) {
         const char *name = tstr_array_get_str_quick(parts, i);
         CHECK_NULL(name);
-        tree_node *next = child_of(node, name);
+        tree_node *next = find_child(node, name);
         if (!next && wildcard)
-            next = child_of(node, wildcard);
+            next = find_child(node, wildcard);
         if (!next)
             return LC_NOT_FOUND;
         node = next;
@@ -192,7 +192,7 @@ struct tree_walk {
     void *data;
 };
 
-lc_status visit(array *, uint32_t, void *element, void *data) {
+lc_status visit_child(array *, uint32_t, void *element, void *data) {
     const auto *walk = static_cast<const tree_walk *>(data);
     auto *child = static_cast<tree_node *>(element);
     return walk->function(walk->whole, child, child->name, child->value, walk->data);
@@ -207,5 +207,5 @@ lc_status tree_foreach(tree *whole, tree_node *node, uint32_t flags, tree_foreac
     if (flags != 0)
         FAIL_WITH(LC_NOT_IMPLEMENTED);
     tree_walk walk{whole, function, data};
-    return array_foreach((node ? node : whole->root)->children, visit, &walk);
+    return array_foreach((node ? node : whole->root)->children, visit_child, &walk);
 }

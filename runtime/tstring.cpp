@@ -24,7 +24,7 @@
 
 namespace {
 
-lc_status give_own_bytes(tstring *string, uint32_t size) {
+lc_status allocate_own_bytes(tstring *string, uint32_t size) {
     const bool placed = string->placed & ts_placed_bytes;
     auto *buffer = static_cast<char *>(placed ? malloc(size) : realloc(string->buffer, size));
     CHECK_NULL(buffer);
@@ -35,18 +35,18 @@ lc_status give_own_bytes(tstring *string, uint32_t size) {
     string->size = size;
     return LC_OK;
 }
-lc_status give_size(tstring *string, uint32_t size) {
-    return size == string->size ? LC_OK : give_own_bytes(string, size);
+lc_status set_allocated_size(tstring *string, uint32_t size) {
+    return size == string->size ? LC_OK : allocate_own_bytes(string, size);
 }
 
 // The size is halved while it is more than four times what is needed.
-uint32_t shrunk(uint32_t size, uint64_t need) {
+uint32_t shrunk_size(uint32_t size, uint64_t need) {
     while (size > 4 * need && size > ts_size_initial)
         size = std::max(size / ts_resize_factor, ts_size_initial);
     return size;
 }
 
-lc_status fit(tstring *string, int64_t length) {
+lc_status adapt_string_size(tstring *string, int64_t length) {
     const int64_t need = std::max<int64_t>(length + 1, ts_size_initial);
     if (need > ts_size_max) {
         LC_LOG(LC_LOG_ERR, "maximum size exceeded: %d",
@@ -54,16 +54,16 @@ lc_status fit(tstring *string, int64_t length) {
         return LC_ASSERTION;
     }
     if (string->size >= need)
-        return give_size(string, shrunk(string->size, static_cast<uint64_t>(need)));
+        return set_allocated_size(string, shrunk_size(string->size, static_cast<uint64_t>(need)));
     uint64_t size = std::max(string->size, ts_size_initial);
     while (size < static_cast<uint64_t>(need))
         size *= ts_resize_factor;
     size = std::min<uint64_t>(size, ts_size_max);
     size = std::min(size, static_cast<uint64_t>(need) + ts_size_max_extra_growth);
-    return give_size(string, static_cast<uint32_t>(size));
+    return set_allocated_size(string, static_cast<uint32_t>(size));
 }
 
-void ended(tstring *string, int32_t length) {
+void end_string_at(tstring *string, int32_t length) {
     string->length = length;
     string->buffer[length] = 0;
     string->characters = string->utf8 ? utf8_count(string->buffer, length) : length;
@@ -71,7 +71,7 @@ void ended(tstring *string, int32_t length) {
 
 // --- The one change
 
-lc_status splice(tstring *string, int32_t at, int32_t removed, const char *bytes, int64_t added) {
+lc_status replace_bytes(tstring *string, int32_t at, int32_t removed, const char *bytes, int64_t added) {
     // The text may be part of the string itself (ts_append(s, s)), which moves when the buffer grows.
     owned_text copy;
     if (added > 0 && bytes >= string->buffer && bytes < string->buffer + string->size) {
@@ -82,14 +82,14 @@ lc_status splice(tstring *string, int32_t at, int32_t removed, const char *bytes
     }
     const int64_t length = int64_t{string->length} - removed + added;
     if (length + 1 > string->size)
-        CHECK_QUIET(fit(string, length));
+        CHECK_QUIET(adapt_string_size(string, length));
     const int32_t rest = string->length - at - removed;
     memmove(string->buffer + at + added, string->buffer + at + removed, static_cast<size_t>(rest));
     if (added > 0)
         memcpy(string->buffer + at, bytes, static_cast<size_t>(added));
     const bool shorter = length < string->length;
-    ended(string, static_cast<int32_t>(length));
-    return shorter ? fit(string, length) : LC_OK;
+    end_string_at(string, static_cast<int32_t>(length));
+    return shorter ? adapt_string_size(string, length) : LC_OK;
 }
 
 lc_status byte_offset(const tstring *string, int32_t offset, int32_t *out_bytes) {
@@ -103,7 +103,7 @@ lc_status byte_offset(const tstring *string, int32_t offset, int32_t *out_bytes)
 }
 
 // The number of bytes of `count` characters from byte `at` on, or of as many as there are.
-lc_status span(const tstring *string, int32_t at, int32_t count, int32_t *out_bytes) {
+lc_status bytes_of_characters(const tstring *string, int32_t at, int32_t count, int32_t *out_bytes) {
     const int32_t rest = string->length - at;
     if (!string->utf8) {
         *out_bytes = std::min(count, rest);
@@ -133,7 +133,7 @@ lc_status ts_new_size(tstring **out, uint32_t size) {
         FAIL_WITH(LC_NULL);
     }
     string->size = size;
-    ended(string, 0);
+    end_string_at(string, 0);
     *out = string;
     return LC_OK;
 }
@@ -165,7 +165,7 @@ lc_status ts_new_sprintf(tstring **out, const char *format, ...) {
 
 namespace {
 
-lc_status takeover(tstring **out, char **inout_text, int32_t length, int32_t size, bool utf8) {
+lc_status take_over_text(tstring **out, char **inout_text, int32_t length, int32_t size, bool utf8) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(inout_text);
@@ -180,6 +180,7 @@ lc_status takeover(tstring **out, char **inout_text, int32_t length, int32_t siz
     auto *string = static_cast<tstring *>(calloc(1, sizeof(tstring)));
     owned<tstring, ts_release> guard(string);
     CHECK_NULL(string);
+    // Every string has at least this size, which the growth by doubling relies on.
     if (size < static_cast<int32_t>(ts_size_initial)) {
         auto *enlarged = static_cast<char *>(realloc(*inout_text, ts_size_initial));
         CHECK_NULL(enlarged);
@@ -189,7 +190,7 @@ lc_status takeover(tstring **out, char **inout_text, int32_t length, int32_t siz
     string->buffer = *inout_text;
     string->size = static_cast<uint32_t>(size);
     string->utf8 = utf8;
-    ended(string, length);
+    end_string_at(string, length);
     *inout_text = nullptr;
     *out = guard.take();
     return LC_OK;
@@ -198,17 +199,17 @@ lc_status takeover(tstring **out, char **inout_text, int32_t length, int32_t siz
 } // namespace
 
 lc_status ts_new_str_takeover(tstring **out, char **inout_text, int32_t length, int32_t size) {
-    return takeover(out, inout_text, length, size, false);
+    return take_over_text(out, inout_text, length, size, false);
 }
 lc_status ts_new_str_takeover_utf8(tstring **out, char **inout_text, int32_t length, int32_t size) {
-    return takeover(out, inout_text, length, size, true);
+    return take_over_text(out, inout_text, length, size, true);
 }
 lc_status ts_set_utf8(tstring *string, int on) {
     CHECK_NULL(string);
     if (on)
         CHECK_STATUS(utf8_check(string->buffer, string->length));
     string->utf8 = on ? 1 : 0;
-    ended(string, string->length);
+    end_string_at(string, string->length);
     return LC_OK;
 }
 lc_status ts_free(tstring **inout) {
@@ -224,21 +225,22 @@ lc_status ts_free(tstring **inout) {
 }
 lc_status ts_clear_no_resize(tstring *string) {
     CHECK_NULL(string);
-    ended(string, 0);
+    end_string_at(string, 0);
     return LC_OK;
 }
 lc_status ts_clear(tstring *string) {
     CHECK_NULL(string);
-    ended(string, 0);
-    return give_size(string, shrunk(string->size, 1));
+    end_string_at(string, 0);
+    return set_allocated_size(string, shrunk_size(string->size, 1));
 }
 lc_status ts_detach(tstring **inout, char **out_text, int32_t *out_length) {
     CHECK_NULL(inout);
     CHECK_NULL(*inout);
     CHECK_NULL(out_text);
     tstring *string = *inout;
+    // Bytes inside a block can't be freed by the caller, so they are copied.
     if (string->placed & ts_placed_bytes)
-        CHECK_QUIET(give_own_bytes(string, std::max(string->size, ts_size_initial)));
+        CHECK_QUIET(allocate_own_bytes(string, std::max(string->size, ts_size_initial)));
     *out_text = string->buffer;
     if (out_length)
         *out_length = string->length;
@@ -255,7 +257,7 @@ lc_status ts_dup(const tstring *string, tstring **out) {
     owned<tstring, ts_release> copy;
     CHECK_STATUS(ts_new(&copy.pointer));
     copy.pointer->utf8 = string->utf8;
-    CHECK_STATUS(splice(copy.pointer, 0, 0, string->buffer, string->length));
+    CHECK_STATUS(replace_bytes(copy.pointer, 0, 0, string->buffer, string->length));
     *out = copy.take();
     return LC_OK;
 }
@@ -308,11 +310,11 @@ lc_status ts_substr(const tstring *string, int32_t start, int32_t count, tstring
     CHECK_CONDITION(start >= 0 && start <= string->characters);
     int32_t at = 0, bytes = 0;
     CHECK_STATUS(byte_offset(string, start, &at));
-    CHECK_STATUS(span(string, at, count < 0 ? string->characters - start : count, &bytes));
+    CHECK_STATUS(bytes_of_characters(string, at, count < 0 ? string->characters - start : count, &bytes));
     owned<tstring, ts_release> piece;
     CHECK_STATUS(ts_new(&piece.pointer));
     piece.pointer->utf8 = string->utf8;
-    CHECK_STATUS(splice(piece.pointer, 0, 0, string->buffer + at, bytes));
+    CHECK_STATUS(replace_bytes(piece.pointer, 0, 0, string->buffer + at, bytes));
     *out = piece.take();
     return LC_OK;
 }
@@ -360,16 +362,17 @@ lc_status ts_put_char(tstring *string, int32_t offset, char byte) {
     CHECK_CONDITION(byte != 0 && offset >= 0);
     int32_t at = string->length, removed = 0;
     if (offset < string->characters) {
+        // In a UTF-8 string the character to replace may have several bytes.
         CHECK_STATUS(byte_offset(string, offset, &at));
-        CHECK_STATUS(span(string, at, 1, &removed));
+        CHECK_STATUS(bytes_of_characters(string, at, 1, &removed));
     }
-    CHECK_STATUS(splice(string, at, removed, &byte, 1));
+    CHECK_STATUS(replace_bytes(string, at, removed, &byte, 1));
     return LC_OK;
 }
 lc_status ts_append_char(tstring *string, char byte) {
     CHECK_NULL(string);
     CHECK_CONDITION(byte != 0);
-    CHECK_STATUS(splice(string, string->length, 0, &byte, 1));
+    CHECK_STATUS(replace_bytes(string, string->length, 0, &byte, 1));
     return LC_OK;
 }
 lc_status ts_insert_char(tstring *string, int32_t offset, char byte) {
@@ -377,14 +380,14 @@ lc_status ts_insert_char(tstring *string, int32_t offset, char byte) {
     CHECK_CONDITION(byte != 0);
     int32_t at = 0;
     CHECK_STATUS(byte_offset(string, offset, &at));
-    CHECK_STATUS(splice(string, at, 0, &byte, 1));
+    CHECK_STATUS(replace_bytes(string, at, 0, &byte, 1));
     return LC_OK;
 }
 
 namespace {
 
 // Replaces as many characters as `text` has, or with `to_end` everything from the offset on.
-lc_status write_text(tstring *string, int32_t offset, const char *text, size_t length, bool to_end) {
+lc_status write_checked_text(tstring *string, int32_t offset, const char *text, size_t length, bool to_end) {
     CHECK_CONDITION(length <= ts_size_max);
     const auto bytes = static_cast<int32_t>(length);
     int32_t at = 0, removed = 0;
@@ -394,8 +397,9 @@ lc_status write_text(tstring *string, int32_t offset, const char *text, size_t l
     if (to_end)
         removed = string->length - at;
     else
-        CHECK_STATUS(span(string, at, string->utf8 ? utf8_count(text, bytes) : bytes, &removed));
-    CHECK_STATUS(splice(string, at, removed, text, bytes));
+        CHECK_STATUS(
+            bytes_of_characters(string, at, string->utf8 ? utf8_count(text, bytes) : bytes, &removed));
+    CHECK_STATUS(replace_bytes(string, at, removed, text, bytes));
     return LC_OK;
 }
 
@@ -404,12 +408,12 @@ lc_status write_text(tstring *string, int32_t offset, const char *text, size_t l
 lc_status ts_put_str(tstring *string, int32_t offset, const char *text) {
     CHECK_NULL(string);
     CHECK_NULL(text);
-    return write_text(string, offset, text, strlen(text), false);
+    return write_checked_text(string, offset, text, strlen(text), false);
 }
 lc_status ts_copy_str(tstring *string, int32_t offset, const char *text) {
     CHECK_NULL(string);
     CHECK_NULL(text);
-    return write_text(string, offset, text, strlen(text), true);
+    return write_checked_text(string, offset, text, strlen(text), true);
 }
 lc_status ts_append_str(tstring *string, const char *text) {
     CHECK_NULL(string);
@@ -418,7 +422,8 @@ lc_status ts_append_str(tstring *string, const char *text) {
 lc_status ts_append(tstring *string, const tstring *other) {
     CHECK_NULL(string);
     CHECK_NULL(other);
-    return write_text(string, string->characters, other->buffer, static_cast<size_t>(other->length), false);
+    return write_checked_text(string, string->characters, other->buffer, static_cast<size_t>(other->length),
+                              false);
 }
 lc_status ts_append_sprintf(tstring *string, const char *format, ...) {
     CHECK_NULL(string);
@@ -451,11 +456,12 @@ lc_status put_fragment(tstring *string, int32_t offset, const char *text, int32_
         first = static_cast<size_t>(skipped);
         length = static_cast<size_t>(taken);
     } else {
+        // `text` may be shorter than `start`; strlen() alone would read past its end.
         if (strnlen(text, first) < first)
             FAIL_WITH(LC_NO_BUFFER_SPACE);
         length = count < 0 ? strlen(text + first) : strnlen(text + first, static_cast<size_t>(count));
     }
-    return write_text(string, offset, text + first, length, false);
+    return write_checked_text(string, offset, text + first, length, false);
 }
 
 } // namespace
@@ -483,8 +489,9 @@ lc_status ts_trim(tstring *string, char head, char tail) {
         first++;
     while (tail && end > first && string->buffer[end - 1] == tail)
         end--;
-    CHECK_STATUS(splice(string, end, string->length - end, nullptr, 0));
-    CHECK_STATUS(splice(string, 0, first, nullptr, 0));
+    // The tail first, so that `end` is still valid.
+    CHECK_STATUS(replace_bytes(string, end, string->length - end, nullptr, 0));
+    CHECK_STATUS(replace_bytes(string, 0, first, nullptr, 0));
     return LC_OK;
 }
 lc_status ts_trim_tail(tstring *string, char tail) {

@@ -24,7 +24,7 @@ struct token_syntax {
     bool escapable(char next) const { return next && (next == separator || next == escape || next == quote); }
 };
 
-bool is_bad(const token_syntax &syntax) {
+bool is_ambiguous(const token_syntax &syntax) {
     return !syntax.separator || syntax.separator == syntax.escape || syntax.separator == syntax.quote ||
            (syntax.escape && syntax.escape == syntax.quote);
 }
@@ -43,7 +43,7 @@ lc_status add_token(const token_syntax &syntax, tstr_array *tokens, const char *
     return LC_OK;
 }
 
-lc_status scan(const token_syntax &syntax, const char *text, tstr_array *tokens) {
+lc_status scan_text(const token_syntax &syntax, const char *text, tstr_array *tokens) {
     const size_t size = strlen(text);
     if (size >= ts_size_max) // a token could be longer than a string can be
         FAIL_WITH(LC_ASSERTION);
@@ -79,11 +79,11 @@ lc_status scan(const token_syntax &syntax, const char *text, tstr_array *tokens)
     return LC_OK;
 }
 
-lc_status tokenize(token_syntax syntax, const char *text, tstr_array **out) {
+lc_status split_text(token_syntax syntax, const char *text, tstr_array **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(text);
-    if (is_bad(syntax)) {
+    if (is_ambiguous(syntax)) {
         LC_LOG(LC_LOG_ERR, "called with invalid chars: %d %d %d\n", syntax.separator, syntax.escape,
                syntax.quote);
         return LC_GENERIC;
@@ -94,7 +94,7 @@ lc_status tokenize(token_syntax syntax, const char *text, tstr_array **out) {
     CHECK_STATUS(tstr_array_new(&tokens.pointer, nullptr));
     if (!*text)
         syntax.flags |= ts_tok_keep_empty; // an empty text is one empty token
-    CHECK_STATUS(scan(syntax, text, tokens.pointer));
+    CHECK_STATUS(scan_text(syntax, text, tokens.pointer));
     const uint32_t count = tstr_array_length_quick(tokens.pointer);
     const bool empty = count == 0 || (count == 1 && ts_length(tstr_array_get_quick(tokens.pointer, 0)) == 0);
     if (!(empty && (syntax.flags & ts_tok_empty_is_null)))
@@ -106,17 +106,17 @@ lc_status tokenize(token_syntax syntax, const char *text, tstr_array **out) {
 
 lc_status ts_tokenize_str(const char *text, char separator, char escape, char quote, uint32_t flags,
                           tstr_array **out) {
-    return tokenize({separator, escape, quote, flags, false}, text, out);
+    return split_text({separator, escape, quote, flags, false}, text, out);
 }
 lc_status ts_tokenize_str_utf8(const char *text, char separator, char escape, char quote, uint32_t flags,
                                tstr_array **out) {
-    return tokenize({separator, escape, quote, flags, true}, text, out);
+    return split_text({separator, escape, quote, flags, true}, text, out);
 }
 
 namespace {
 
 // ts_append_char without its checks, while the presized buffer lasts.
-lc_status push(tstring *string, char c) {
+lc_status append_byte(tstring *string, char c) {
     if (static_cast<uint32_t>(string->length) + 2 > string->size)
         return ts_append_char(string, c);
     string->buffer[string->length++] = c;
@@ -133,8 +133,8 @@ lc_status write_token(const token_syntax &syntax, const tstring *token, bool sep
         const bool special =
             (syntax.separator && c == syntax.separator) || (syntax.quote && c == syntax.quote);
         if (syntax.escape && (special || (c == syntax.escape && syntax.escapable(next))))
-            CHECK_STATUS(push(out, syntax.escape));
-        CHECK_STATUS(push(out, c));
+            CHECK_STATUS(append_byte(out, syntax.escape));
+        CHECK_STATUS(append_byte(out, c));
     }
     return LC_OK;
 }
@@ -147,7 +147,7 @@ lc_status write_tokens(const token_syntax &syntax, const tstr_array *array, tstr
         if (!token || (token->length == 0 && (syntax.flags & ts_join_skip_empty)))
             continue;
         if (!first && syntax.separator)
-            CHECK_STATUS(push(out, syntax.separator));
+            CHECK_STATUS(append_byte(out, syntax.separator));
         first = false;
         const bool separated = i + 1 < count || (syntax.flags & ts_join_trailing);
         CHECK_STATUS(write_token(syntax, token, separated && syntax.separator, out));
@@ -155,7 +155,7 @@ lc_status write_tokens(const token_syntax &syntax, const tstr_array *array, tstr
     return LC_OK;
 }
 
-lc_status join(const token_syntax &syntax, const tstr_array *array, tstring **out) {
+lc_status join_tokens(const token_syntax &syntax, const tstr_array *array, tstring **out) {
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(array);
@@ -175,7 +175,7 @@ lc_status join(const token_syntax &syntax, const tstr_array *array, tstring **ou
     const int32_t length = string.pointer->length;
     if ((syntax.flags & ts_join_trailing) &&
         (length == 0 || string.pointer->buffer[length - 1] != syntax.separator))
-        CHECK_STATUS(push(string.pointer, syntax.separator));
+        CHECK_STATUS(append_byte(string.pointer, syntax.separator));
     if (syntax.utf8)
         CHECK_STATUS(ts_set_utf8(string.pointer, 1));
     *out = string.take();
@@ -186,9 +186,9 @@ lc_status join(const token_syntax &syntax, const tstr_array *array, tstring **ou
 
 lc_status ts_join_tokens(const tstr_array *array, char separator, char escape, char quote, uint32_t flags,
                          tstring **out) {
-    return join({separator, escape, quote, flags, false}, array, out);
+    return join_tokens({separator, escape, quote, flags, false}, array, out);
 }
 lc_status ts_join_tokens_utf8(const tstr_array *array, char separator, char escape, char quote,
                               uint32_t flags, tstring **out) {
-    return join({separator, escape, quote, flags, true}, array, out);
+    return join_tokens({separator, escape, quote, flags, true}, array, out);
 }

@@ -31,7 +31,7 @@ int32_t character_length(const char *text, int32_t bytes) {
     return length;
 }
 
-void tell_bytes(const char *text, int32_t bytes) {
+void log_bytes(const char *text, int32_t bytes) {
     owned<tstring, ts_release> list;
     if (!lc_log_check_level(LC_LOG_WARNING) || ts_new(&list.pointer) != LC_OK)
         return;
@@ -57,12 +57,12 @@ int32_t utf8_count(const char *text, int32_t bytes) {
 
 namespace {
 
-lc_status walk(const char *text, int32_t bytes, int32_t characters, int32_t *out_bytes) {
+lc_status step_over_characters(const char *text, int32_t bytes, int32_t characters, int32_t *out_bytes) {
     int32_t at = 0;
     for (int32_t i = 0; characters < 0 ? at < bytes : i < characters; i++) {
         const int32_t length = character_length(text + at, bytes - at);
         if (length == 0) {
-            tell_bytes(text, bytes);
+            log_bytes(text, bytes);
             return LC_BAD_UTF8;
         }
         at += length;
@@ -75,10 +75,10 @@ lc_status walk(const char *text, int32_t bytes, int32_t characters, int32_t *out
 
 lc_status utf8_check(const char *text, int32_t bytes) {
     int32_t end = 0;
-    return walk(text, bytes, -1, &end);
+    return step_over_characters(text, bytes, -1, &end);
 }
 lc_status utf8_skip(const char *text, int32_t bytes, int32_t characters, int32_t *out_bytes) {
-    return walk(text, bytes, characters, out_bytes);
+    return step_over_characters(text, bytes, characters, out_bytes);
 }
 
 uint32_t utf8_decode(const char *text, int32_t bytes) {
@@ -96,7 +96,7 @@ namespace {
 locale_t utf8_locale;
 pthread_once_t utf8_locale_once = PTHREAD_ONCE_INIT;
 
-uint32_t folded(uint32_t character) {
+uint32_t fold_case(uint32_t character) {
     pthread_once(&utf8_locale_once,
                  [] { utf8_locale = newlocale(LC_CTYPE_MASK, "C.UTF-8", static_cast<locale_t>(nullptr)); });
     return utf8_locale ? towlower_l(character, utf8_locale) : towlower(character);
@@ -108,7 +108,8 @@ int utf8_equal_ignoring_case(const char *a, const char *b) {
     while (*a && *b) {
         const int32_t a_length = character_length(a, static_cast<int32_t>(strnlen(a, 6)));
         const int32_t b_length = character_length(b, static_cast<int32_t>(strnlen(b, 6)));
-        if (!a_length || !b_length || folded(utf8_decode(a, a_length)) != folded(utf8_decode(b, b_length)))
+        if (!a_length || !b_length ||
+            fold_case(utf8_decode(a, a_length)) != fold_case(utf8_decode(b, b_length)))
             return 0;
         a += a_length;
         b += b_length;

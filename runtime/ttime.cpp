@@ -122,7 +122,8 @@ int64_t whole_seconds(int64_t us) {
     return us / US_PER_SEC - (us % US_PER_SEC < 0);
 }
 
-lc_status to_text(int64_t us, bool local, const char *format, bool with_zone, uint32_t size, char *buffer) {
+lc_status time_to_text(int64_t us, bool local, const char *format, bool with_zone, uint32_t size,
+                       char *buffer) {
     CHECK_NULL(buffer);
     const time_t seconds = whole_seconds(us);
     tm parts{};
@@ -149,10 +150,10 @@ lc_status lt_date_to_buf(lt_date value, uint32_t size, char *buffer, uint32_t *o
     return LC_OK;
 }
 lc_status lt_daytime_us_to_buf(lt_time_us value, uint32_t size, char *buffer) {
-    return to_text(value, false, "%H:%M:%S", false, size, buffer);
+    return time_to_text(value, false, "%H:%M:%S", false, size, buffer);
 }
 lc_status lt_datetime_us_to_buf(lt_time_us value, int with_zone, uint32_t size, char *buffer) {
-    return to_text(value, true, "%Y/%m/%d %H:%M:%S", with_zone != 0, size, buffer);
+    return time_to_text(value, true, "%Y/%m/%d %H:%M:%S", with_zone != 0, size, buffer);
 }
 lc_status lt_dur_us_to_buf(lt_dur_us value, uint32_t size, char *buffer) {
     CHECK_NULL(buffer);
@@ -165,7 +166,7 @@ lc_status lt_dur_us_to_buf(lt_dur_us value, uint32_t size, char *buffer) {
 namespace {
 
 // To microseconds. LC_ASSERTION on overflow.
-lc_status scaled(int64_t value, int64_t factor, int64_t *out) {
+lc_status scale_to_us(int64_t value, int64_t factor, int64_t *out) {
     CHECK_CONDITION(!__builtin_mul_overflow(value, factor, out));
     return LC_OK;
 }
@@ -177,7 +178,7 @@ lc_status scaled(int64_t value, int64_t factor, int64_t *out) {
 #define LT_COARSER(kind, unit, type, factor, parameters, arguments)                                          \
     lc_status lt_##kind##_##unit##_to_buf(type value, LT_UNPAREN parameters uint32_t size, char *buffer) {   \
         int64_t us = 0;                                                                                      \
-        CHECK_STATUS(scaled(value, factor, &us));                                                            \
+        CHECK_STATUS(scale_to_us(value, factor, &us));                                                       \
         return lt_##kind##_us_to_buf(us, LT_UNPAREN arguments size, buffer);                                 \
     }
 #define LT_UNPAREN(...) __VA_ARGS__ __VA_OPT__(, )
@@ -191,7 +192,7 @@ LT_COARSER(dur, ms, lt_dur_ms, US_PER_MS, (), ())
 namespace {
 
 template <typename Write>
-lc_status to_str(char **out, Write write) {
+lc_status new_time_text(char **out, Write write) {
     CHECK_NULL(out);
     *out = nullptr;
     auto *text = static_cast<char *>(malloc(TEXT_SIZE));
@@ -207,12 +208,12 @@ lc_status to_str(char **out, Write write) {
 } // namespace
 
 lc_status lt_date_to_str(lt_date value, char **out) {
-    return to_str(out, [&](char *text) { return lt_date_to_buf(value, TEXT_SIZE, text, nullptr); });
+    return new_time_text(out, [&](char *text) { return lt_date_to_buf(value, TEXT_SIZE, text, nullptr); });
 }
 // Defines lt_daytime_sec_to_str for example, by way of lt_daytime_sec_to_buf.
 #define LT_TO_STR(name, type, parameters, arguments)                                                         \
     lc_status lt_##name##_to_str(type value, LT_UNPAREN parameters char **out) {                             \
-        return to_str(out, [&](char *text) {                                                                 \
+        return new_time_text(out, [&](char *text) {                                                          \
             return lt_##name##_to_buf(value, LT_UNPAREN arguments TEXT_SIZE, text);                          \
         });                                                                                                  \
     }
@@ -233,7 +234,7 @@ namespace {
 // Truncates to microseconds. Most decimal fractions have no exact representation as a double, so 0.000249
 // would become 248 microseconds; the correction is far below a microsecond, and makes every text that
 // lt_..._to_str writes read back as the same value.
-int64_t truncated_us(double seconds) {
+int64_t truncate_to_us(double seconds) {
     const double us = seconds * static_cast<double>(US_PER_SEC);
     return static_cast<int64_t>(us + us * 1e-15);
 }
@@ -244,11 +245,11 @@ lc_status fraction_from_text(const char *text, int64_t *out_us) {
         return LC_OK;
     if (*text != '.' || sscanf(text, "%lf", &fraction) != 1 || !(fraction >= 0 && fraction < 1))
         return LC_BAD_TYPE;
-    *out_us = truncated_us(fraction);
+    *out_us = truncate_to_us(fraction);
     return LC_OK;
 }
 
-lc_status from_text(const char *text, bool local, lt_time_us *out) {
+lc_status time_from_text(const char *text, bool local, lt_time_us *out) {
     CHECK_NULL(out);
     *out = 0;
     CHECK_NULL(text);
@@ -285,7 +286,7 @@ lc_status lt_str_to_date(const char *text, lt_date *out) {
     return LC_OK;
 }
 lc_status lt_str_to_datetime_us(const char *text, lt_time_us *out) {
-    return from_text(text, true, out);
+    return time_from_text(text, true, out);
 }
 lc_status lt_str_to_daytime_us(const char *text, lt_time_us *out) {
     CHECK_NULL(out);
@@ -295,7 +296,7 @@ lc_status lt_str_to_daytime_us(const char *text, lt_time_us *out) {
     const int length = snprintf(whole, sizeof whole, "1970/1/1 %s", text);
     if (length < 0 || static_cast<size_t>(length) >= sizeof whole)
         return LC_BAD_TYPE;
-    return from_text(whole, false, out);
+    return time_from_text(whole, false, out);
 }
 lc_status lt_str_to_dur_us(const char *text, lt_dur_us *out) {
     CHECK_NULL(out);
@@ -307,18 +308,18 @@ lc_status lt_str_to_dur_us(const char *text, lt_dur_us *out) {
     // Would overflow as microseconds; the form of the test also refuses infinities and NaN.
     if (!(seconds > -9.2e12 && seconds < 9.2e12))
         return LC_BAD_TYPE;
-    *out = truncated_us(seconds);
+    *out = truncate_to_us(seconds);
     return LC_OK;
 }
 
 namespace {
 
-lc_status to_ms(lt_time_us us, int64_t *out) {
+lc_status us_to_ms(lt_time_us us, int64_t *out) {
     CHECK_CONDITION(us >= 0);
     *out = us / US_PER_MS;
     return LC_OK;
 }
-lc_status to_sec(lt_time_us us, int32_t *out) {
+lc_status us_to_sec(lt_time_us us, int32_t *out) {
     CHECK_CONDITION(us >= 0 && us < SEC_LIMIT_US);
     *out = static_cast<int32_t>(us / US_PER_SEC);
     return LC_OK;
@@ -333,7 +334,7 @@ lc_status to_sec(lt_time_us us, int32_t *out) {
         *out = 0;                                                                                            \
         lt_time_us us = 0;                                                                                   \
         CHECK_QUIET(lt_str_to_##kind##_us(text, &us));                                                       \
-        return to_##unit(us, out);                                                                           \
+        return us_to_##unit(us, out);                                                                        \
     }
 LT_FROM_STR(daytime, ms, lt_time_ms)
 LT_FROM_STR(daytime, sec, lt_time_sec)
