@@ -132,7 +132,7 @@ lc_status bn_check_text(const uint8_t *bytes, uint32_t length) {
     const void *nul = length ? memchr(bytes, 0, length) : nullptr;
     if (!nul)
         return LC_OK;
-    LC_LOG(LC_LOG_ERR, "Received string of %u bytes has a NUL at %u", length,
+    LC_LOG(LC_LOG_ERR, "Received string of %u bytes contains a NUL at offset %u", length,
            static_cast<uint32_t>(static_cast<const uint8_t *>(nul) - bytes));
     return LC_ASSERTION;
 }

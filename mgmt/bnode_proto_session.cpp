@@ -175,10 +175,11 @@ lc_status send_message(gcl_session *session, Message *msg) {
 // Replaces a response that doesn't fit. Without any response the peer would wait until its timeout.
 lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, lc_status reason) {
     owned_response refusal;
-    CHECK_STATUS(bn_response_msg_create(&refusal.pointer, msg->msg_type, msg->response_to, LC_NO_BUFFER_SPACE,
-                                        reason == LC_NO_BUFFER_SPACE
-                                            ? BN_TOO_LARGE
-                                            : "The queue of the session is full: ask for less, or later"));
+    CHECK_STATUS(
+        bn_response_msg_create(&refusal.pointer, msg->msg_type, msg->response_to, LC_NO_BUFFER_SPACE,
+                               reason == LC_NO_BUFFER_SPACE
+                                   ? BN_TOO_LARGE
+                                   : "The session's output queue is full: ask for less, or try again later"));
     refusal.pointer->service_id = msg->service_id;
     refusal.pointer->msg_id = msg->msg_id;
     refusal.pointer->transaction_id = msg->transaction_id;

@@ -104,7 +104,7 @@ bool listener_is_trusted(const gcl_session *session) {
     }
     if (listener.uid == 0 || listener.uid == geteuid())
         return true;
-    LC_LOG(LC_LOG_ERR, "session %d: proto admin: the provider is of user %d, not of root or our own",
+    LC_LOG(LC_LOG_ERR, "session %d: proto admin: the provider runs as user %d, not as root or our own user",
            session->id, static_cast<int>(listener.uid));
     return false;
 }

@@ -77,7 +77,7 @@ lc_status check_sendable(const gcl_session *session) {
 // Whether a frame of `total` bytes fits in the queue, whose limit is `queue_max`.
 lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue_max) {
     if (total > GCL_FRAME_MAX) {
-        LC_LOG(LC_LOG_WARNING, "session %d: message of %llu bytes does not fit a frame", session->id,
+        LC_LOG(LC_LOG_WARNING, "session %d: message of %llu bytes is larger than a frame", session->id,
                static_cast<unsigned long long>(total));
         return LC_NO_BUFFER_SPACE;
     }
@@ -86,7 +86,7 @@ lc_status check_room(gcl_session *session, uint64_t total, uint64_t queue_max) {
         return LC_OK;
     if (!session->frames_lost++)
         LC_LOG(LC_LOG_WARNING,
-               "session %d: output queue full with %llu bytes, peer %s does not read; frames are lost",
+               "session %d: output queue is full (%llu bytes): peer %s is not reading, frames are dropped",
                session->id, static_cast<unsigned long long>(session->queued_bytes),
                gcl_admin_of(session) ? gcl_admin_of(session)->peer_name : "");
     return LC_CANCELLED;
@@ -96,7 +96,7 @@ void report_drained(gcl_session *session) {
     // At half of the limit, so that a queue which stays nearly full doesn't log a pair of lines per frame.
     if (!session->frames_lost || session->queued_bytes > GCL_QUEUE_MAX_BYTES / 2)
         return;
-    LC_LOG(LC_LOG_NOTICE, "session %d: output queue drains again, %llu frames were lost", session->id,
+    LC_LOG(LC_LOG_NOTICE, "session %d: output queue has drained, %llu frames were dropped", session->id,
            static_cast<unsigned long long>(session->frames_lost));
     session->frames_lost = 0;
 }

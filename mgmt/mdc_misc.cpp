@@ -233,7 +233,8 @@ lc_status add_registration(tree *registered, const bn_binding *binding, uint32_t
     CHECK_STATUS(bn_binding_get_name_parts_const(binding, &parts, nullptr));
     const uint32_t count = tstr_array_length_quick(parts);
     if (count > REGISTERED_PARTS_MAX) {
-        LC_LOG(LC_LOG_ERR, "Registered name of %u parts ignored", count);
+        LC_LOG(LC_LOG_ERR, "Ignoring a registered name of %u parts, the limit is %u", count,
+               REGISTERED_PARTS_MAX);
         return LC_OK;
     }
     if (*inout_total > REGISTERED_TOTAL_MAX)
@@ -241,8 +242,8 @@ lc_status add_registration(tree *registered, const bn_binding *binding, uint32_t
     // The first name beyond the limit is logged, further ones are ignored silently by the test above.
     *inout_total += count;
     if (*inout_total > REGISTERED_TOTAL_MAX) {
-        LC_LOG(LC_LOG_ERR, "Registered names of more than %u parts, ignored from %s on", REGISTERED_TOTAL_MAX,
-               bn_binding_get_name_quick(binding));
+        LC_LOG(LC_LOG_ERR, "Registered names have more than %u parts in all, ignoring %s and what follows",
+               REGISTERED_TOTAL_MAX, bn_binding_get_name_quick(binding));
         return LC_OK;
     }
     owned_reg record;

@@ -75,7 +75,7 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
     FILE *file = fopen(path, "re");
     if (!file) {
         if (errno != ENOENT && !out_bad_line)
-            QV_LOG(LC_LOG_WARNING, "%s: cannot be read (%m), defaults taken", path);
+            QV_LOG(LC_LOG_WARNING, "%s cannot be read (%m): using the defaults", path);
         return limits;
     }
     bool more = true;
@@ -99,7 +99,7 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
         if (out_bad_line)
             *out_bad_line = *out_bad_line ? *out_bad_line : number;
         else
-            QV_LOG(LC_LOG_WARNING, "%s: bad line %u passed over: %s", path, number, line);
+            QV_LOG(LC_LOG_WARNING, "%s: ignoring bad line %u: %s", path, number, line);
     }
     fclose(file);
     return limits;

@@ -38,8 +38,8 @@ bool wccp_attach_mailbox() {
     if (length < sizeof(wccp_tunnel_mailbox)) {
         static std::atomic<bool> logged; // tunneld repeats this until it succeeds
         if (!logged.exchange(true))
-            QV_LOG(LC_LOG_ERR, "Block %s has %lu bytes instead of %lu and is not used", WCCP_MAILBOX_NAME,
-                   static_cast<unsigned long>(length),
+            QV_LOG(LC_LOG_ERR, "Shared memory block %s has %lu bytes instead of %lu and is not used",
+                   WCCP_MAILBOX_NAME, static_cast<unsigned long>(length),
                    static_cast<unsigned long>(sizeof(wccp_tunnel_mailbox)));
         shmdt(block);
         return false;

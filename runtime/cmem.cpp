@@ -277,10 +277,11 @@ bool fill_registry(cmem_registry *fresh) {
         sleep(1);
     }
     const auto key = static_cast<uint32_t>(CMEM_REGISTRY_KEY);
-    QV_LOG(LC_LOG_ERR,
-           "%s: the block registry has been loading for %u seconds; the process that loads it hangs or has "
-           "died. Remove it with \"ipcrm -M 0x%x\" when no program uses it\n",
-           "cmem_attach_registry", WAIT_SECONDS, key);
+    QV_LOG(
+        LC_LOG_ERR,
+        "%s: the block registry has been loading for %u seconds: the process that is loading it hangs or has "
+        "died. Remove the registry with \"ipcrm -M 0x%x\" when no program is using it\n",
+        "cmem_attach_registry", WAIT_SECONDS, key);
     return false;
 }
 

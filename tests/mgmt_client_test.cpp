@@ -330,9 +330,10 @@ TEST(client, monitoring_answers) {
     ASSERT_EQ(several.dispatch(), 0);
     EXPECT_EQ(several.answer(), (strings{deep + " 1068", "/one 1071"}));
     const std::string lines = log.take();
-    EXPECT_NE(lines.find("Registered name of 65 parts ignored"), std::string::npos);
-    EXPECT_NE(lines.find("Registered names of more than 4096 parts, ignored from /late on"),
-              std::string::npos);
+    EXPECT_NE(lines.find("Ignoring a registered name of 65 parts, the limit is 64"), std::string::npos);
+    EXPECT_NE(
+        lines.find("Registered names have more than 4096 parts in all, ignoring /late and what follows"),
+        std::string::npos);
     EXPECT_EQ(lines.find("/later"), std::string::npos);
     EXPECT_NE(lines.find("Unexpected query subop 0; ignoring request for binding /odd"), std::string::npos);
 

@@ -162,7 +162,7 @@ TEST_F(Gcl, ThePeersIdsAreChecked) {
     ASSERT_TRUE(provider.put(greeting_bytes(none, none)));
     round();
     EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
-    EXPECT_EQ(log.count("the provider is of user 1, not of root or our own"), 1);
+    EXPECT_EQ(log.count("the provider runs as user 1, not as root or our own user"), 1);
     drop();
 }
 
@@ -538,11 +538,11 @@ TEST_F(Gcl, AQueueThatFillsLosesFramesAndSaysSoOnce) {
         EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
         EXPECT_LE(static_cast<uint64_t>(queued) * (body.size() + 32), GCL_QUEUE_MAX_BYTES + 1000000);
         EXPECT_GE(static_cast<uint64_t>(queued) * (body.size() + 32), GCL_QUEUE_MAX_BYTES - body.size() - 32);
-        EXPECT_EQ(log.count("output queue full"), 1) << filling;
+        EXPECT_EQ(log.count("output queue is full"), 1) << filling;
         EXPECT_EQ(log.count("Error code"), 0);
         for (const wire &frame : taken(queued))
             ASSERT_EQ(frame, frame_bytes(3, 1, body, 2000003 + sent++));
-        EXPECT_EQ(log.count("51 frames were lost"), 1) << filling;
+        EXPECT_EQ(log.count("51 frames were dropped"), 1) << filling;
     }
 }
 

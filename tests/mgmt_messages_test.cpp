@@ -256,7 +256,7 @@ TEST(messages, a_nul_in_a_text_is_refused) {
         EXPECT_EQ(bytes_of(bn_attrib_array_get_quick(node->binding->attributes, 1)->value.binary), text);
         EXPECT_EQ(read(bn_response_msg_deserialize, room + response(6, u32(0) + str(text) + u32(0)), &answer),
                   refused ? LC_ASSERTION : LC_OK);
-        EXPECT_EQ(log.count("Received string of 3 bytes has a NUL at 1"), refused ? 8 : 0);
+        EXPECT_EQ(log.count("Received string of 3 bytes contains a NUL at offset 1"), refused ? 8 : 0);
     }
 }
 
@@ -567,7 +567,8 @@ TEST_F(MessageSession, AnAnswerThatDoesNotFitIsRefused) {
             (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_WRITABLE, with.session, nullptr);
         ASSERT_EQ(frame.back(), 'q');
     }
-    expect_refusal(with.provider.take_frame(), "The queue of the session is full: ask for less, or later");
+    expect_refusal(with.provider.take_frame(),
+                   "The session's output queue is full: ask for less, or try again later");
     EXPECT_EQ(log.count("Error code"), 0);
 }
 

@@ -67,10 +67,10 @@ else
     kill -STOP $mgmtd
     for _ in $(seq 200); do
         flap
-        grep -q 'output queue full' "$LAB/a1.log" && break
+        grep -q 'output queue is full' "$LAB/a1.log" && break
     done
     flap
-    [ "$(grep -c 'output queue full with [0-9]* bytes, peer [^ ]* does not read; frames are lost' "$LAB/a1.log")" = 1 ] ||
+    [ "$(grep -c 'output queue is full ([0-9]* bytes): peer [^ ]* is not reading, frames are dropped' "$LAB/a1.log")" = 1 ] ||
         fail "a full queue was not logged exactly once"
     # The tolerance is for a busy machine: a wccpd that waits for mgmtd would send nothing at all.
     list_hello_times | jq -es '[.[1:], .[:-1]] | transpose | map(.[0] - .[1]) | length > 25 and max < 60 and
