@@ -14,7 +14,7 @@
 // outdated.
 std::atomic<uint32_t> bn_binding_renames;
 
-// --- Life
+// --- Creation and release
 
 lc_status bn_binding_free(bn_binding **inout) {
     CHECK_NULL(inout);

@@ -78,7 +78,7 @@ void bn_size_copy(bn_block_size *size, const bn_binding *binding) {
     }
 }
 
-// --- Placing
+// --- Placing objects in the block
 
 lc_status bn_block_new(const bn_block_size *size, bn_block_builder *out) {
     auto *memory = static_cast<uint8_t *>(malloc(HEAD + size->records + size->texts));

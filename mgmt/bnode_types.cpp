@@ -434,7 +434,7 @@ const bn_type_row *bn_type_find(uint32_t type_and_flags) {
     return type <= BN_TYPE_LAST ? tables.by_number[type] : nullptr;
 }
 
-// --- Predicates and order
+// --- Predicates and comparison
 
 namespace {
 

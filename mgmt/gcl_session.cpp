@@ -116,7 +116,7 @@ void endpoint_text(const gcl_endpoint *endpoint, char *out, size_t size) {
     snprintf(out, size, "%d.%d.%d.%d:%d", bytes[0], bytes[1], bytes[2], bytes[3], ntohs(address.sin_port));
 }
 
-// --- Making
+// --- Creation
 
 lc_status open_unix(gcl_session *session) {
     // The socket is bound to a path of its own, which is how the provider sees who is connected.
@@ -348,7 +348,7 @@ lc_status gcl_session_client_connect_by_provider(gcl_session *session, const cha
     return LC_OK;
 }
 
-// --- Ending
+// --- Closing
 
 namespace {
 

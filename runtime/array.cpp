@@ -44,7 +44,7 @@ void free_nothing(void *) {}
 
 } // namespace
 
-// --- Options and life
+// --- Options, creation and release
 
 lc_status array_options_get_defaults(array_options *out) {
     CHECK_NULL(out);
@@ -203,7 +203,7 @@ lc_status array_peek(const array *list, void **out_element) {
     return list->length ? array_get(list, list->length - 1, out_element) : LC_NOT_FOUND;
 }
 
-// --- Placing
+// --- Insertion
 
 namespace {
 
@@ -365,7 +365,7 @@ lc_status array_insert_sorted(array *list, const void *element) {
     return array_insert_sorted_hint(list, element, 0);
 }
 
-// --- Taking out
+// --- Removal
 
 lc_status array_remove_no_shift(array *list, uint32_t index, void **out_element) {
     CHECK_NULL(out_element);

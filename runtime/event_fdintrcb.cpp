@@ -103,7 +103,7 @@ fdic_libevent_entry *find_bridge_entry(const fdic_libevent *bridge, uint32_t id)
     return found ? static_cast<fdic_libevent_entry *>(value) : nullptr;
 }
 
-// --- From the loop
+// --- Calls from the event loop
 
 lc_status call_read_function(int fd, const fdic_libevent_entry *entry) {
     const fdic_event *interest = &entry->interest;
@@ -154,7 +154,7 @@ void fdic_libevent_handler(int fd, short flags, void *data) {
     (void)call_interest(fd, flags, &entry);
 }
 
-// --- Into the loop
+// --- Registration with the event loop
 
 lc_status remove_interest(fdic_libevent *bridge, const fdic_event *change) {
     fdic_libevent_entry *entry = find_bridge_entry(bridge, change->id);

@@ -63,7 +63,7 @@ fdic_event *find_interest(const fdic_event_array *events, uint32_t id, uint32_t 
     return fdic_event_array_get_quick(events, *out_index);
 }
 
-// --- The compare step
+// --- Comparing the interests before and after a call
 
 bool can_be_watched(const fdic_event *event) {
     return (event->has_fd && event->fd >= 0) || (event->has_timer && event->delay >= 0);
@@ -128,7 +128,7 @@ lc_status report_changes(fdic *context) {
     return LC_OK;
 }
 
-// --- Changes
+// --- Adding, changing and deleting interests
 
 lc_status add_interest(fdic *context, fdic_event *event, int32_t *out_id) {
     event->context = context;

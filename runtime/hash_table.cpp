@@ -67,7 +67,7 @@ int ht_key_equal_string_func(const void *a, uint32_t a_length, const void *b, ui
     return a_length == b_length && memcmp(a, b, a_length) == 0;
 }
 
-// --- Life
+// --- Creation and release
 
 void ht_default_options(ht_options *out) {
     *out = ht_options{};

@@ -46,7 +46,7 @@ namespace {
 int32_t lost_lines;               // because the daemon didn't read; G_log_state_lock guards it
 thread_local bool inside_the_log; // this thread holds G_log_state_lock
 
-// --- Start and end
+// --- Initialization and shutdown
 
 void report_lock_failure(int status, const char *function, int line) {
     if (status != 0)
@@ -182,7 +182,7 @@ lc_status init_unnamed() {
     return lc_log_init(full, "unk", 0, 0xb0000, LC_LOG_DEBUG, LOG_USER, LOG_TO_SYSLOG);
 }
 
-// --- A line
+// --- Writing a line
 
 // What a line consists of, besides the caller's text.
 struct log_line {
@@ -442,7 +442,7 @@ void util_log(int32_t level, const char *prefix, const char *format, ...) {
         (void)qv_log_internal(level, nullptr, nullptr, "%s%s", prefix ? prefix : "", text);
 }
 
-// --- A plain file
+// --- The plain log file
 
 int lc_log_file(const char *path, const char *format, ...) {
     const cancel_off_guard uncancelled;

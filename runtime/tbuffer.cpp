@@ -68,7 +68,7 @@ void end_buffer_at(tbuffer *buffer, uint32_t length) {
 
 } // namespace
 
-// --- Life
+// --- Creation and release
 
 lc_status tb_new_size(tbuffer **out, uint32_t size) {
     CHECK_NULL(out);

@@ -1,7 +1,8 @@
 // Growable strings.
 //
-// Every change of a text is one call of splice(), which replaces some bytes at one place by others. The
-// buffer grows before the change and shrinks after it, so that a failed allocation leaves the text as it was.
+// Every change of a text is one call of replace_bytes(), which replaces some bytes at one place by others.
+// The buffer grows before the change and shrinks after it, so that a failed allocation leaves the text as it
+// was.
 //
 // In a string that is marked UTF-8 offsets are characters. They are converted to byte offsets first, by
 // stepping through the text, which fails on invalid UTF-8. Text that is added is checked as well; only single
@@ -69,7 +70,7 @@ void end_string_at(tstring *string, int32_t length) {
     string->characters = string->utf8 ? utf8_count(string->buffer, length) : length;
 }
 
-// --- The one change
+// --- Replacing bytes
 
 lc_status replace_bytes(tstring *string, int32_t at, int32_t removed, const char *bytes, int64_t added) {
     // The text may be part of the string itself (ts_append(s, s)), which moves when the buffer grows.
@@ -115,7 +116,7 @@ lc_status bytes_of_characters(const tstring *string, int32_t at, int32_t count, 
 
 } // namespace
 
-// --- Life
+// --- Creation and release
 
 lc_status ts_new_size(tstring **out, uint32_t size) {
     CHECK_NULL(out);
