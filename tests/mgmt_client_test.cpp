@@ -28,7 +28,7 @@ static std::string value_of(const bn_binding_array *bindings, const char *name) 
     return ts_str(value);
 }
 
-// A server that answers a query for a node with what it holds, and remembers what it was asked.
+// A server that answers queries from an array of bindings, and records the last request.
 struct server {
     server() {
         EXPECT_EQ(bn_binding_array_new(&held), 0);
@@ -47,7 +47,7 @@ struct server {
         const uint32_t count = bn_request_per_node_array_length_quick(request->nodes);
         response_owner response;
         EXPECT_EQ(bn_response_msg_create(&response, bn_request_msg_response_msg_type(request->msg_type), 1,
-                                         self->code, "told"),
+                                         self->code, "message"),
                   0);
         response->db_revision_id = 77;
         for (uint32_t i = 0; i < count; i++) {
@@ -81,7 +81,7 @@ struct server {
     std::vector<std::string> names;
 };
 
-TEST(client, requests_and_what_comes_back) {
+TEST(client, requests_and_their_results) {
     server peer;
     add(peer.held, "/a", "one");
     EXPECT_EQ(mdc_init(nullptr, nullptr, nullptr, nullptr, nullptr, &peer.client), LC_NULL);
@@ -91,7 +91,7 @@ TEST(client, requests_and_what_comes_back) {
     ASSERT_EQ(mdc_get_binding(peer.client, &code, &message, 0, &binding, "/a", nullptr), 0);
     EXPECT_STREQ(bn_binding_get_name_quick(binding), "/a");
     EXPECT_EQ(peer.subop, bn_query_get);
-    EXPECT_STREQ(ts_str(message), "told");
+    EXPECT_STREQ(ts_str(message), "message");
     peer.code = 5;
     ASSERT_EQ(mdc_get_binding(peer.client, &code, nullptr, 0, &binding, "/missing", nullptr), 0);
     EXPECT_EQ(binding.pointer, nullptr);
@@ -141,7 +141,7 @@ static lc_status note(const bn_binding_array *, uint32_t index, bn_binding *, co
     return LC_OK;
 }
 
-TEST(client, foreach_counts_what_went_well) {
+TEST(client, foreach_counts_successful_calls) {
     bindings_owner bindings;
     ASSERT_EQ(bn_binding_array_new(&bindings), 0);
     for (const char *name : {"/a/b/c", "/a/b/c/d", "/a/x/c", "/z/b/c", "/a/y/c"})
@@ -211,7 +211,7 @@ TEST(client, change_event) {
 
 using strings = std::vector<std::string>;
 
-// The daemon's side of a query, which notes what it is asked, and the session over which the answer goes.
+// The daemon's side of a query, which records what it is asked for, and the session that gets the answer.
 struct monitored {
     hand_session with;
     owner<bn_request_msg, bn_request_msg_free> request;
@@ -251,7 +251,7 @@ struct monitored {
         return LC_OK;
     }
     lc_status dispatch() { return mdc_dispatch_mon_request(with.session, request, get, this, list, this); }
-    // Each binding of the answer, followed by the id of the node that it answers.
+    // The name of each binding in the answer, with the id of the node that it answers.
     strings answer() {
         const wire frame = with.provider.take_frame(100);
         owner<tbuffer, tb_free> buffer;
@@ -278,13 +278,13 @@ TEST(client, monitoring_walk) {
     const struct {
         const char *name;
         uint32_t subop, flags;
-        strings asked; // "?" before what is asked for its children
+        strings asked; // "?": asked for the children
     } cases[] = {
         {"/a/1/b", get, 0, {"/a/1/b"}},
         {"/other", get, 0, {"/other"}},
         {"/other", walk, tree | self, {}},
         {"/a/*", walk, 0, {"?/a", "/a/1", "/a/2"}},
-        {"/a", walk, 0, {"?/a", "/a/1", "/a/2"}}, // the direct children and no deeper
+        {"/a", walk, 0, {"?/a", "/a/1", "/a/2"}}, // only the direct children
         {"/a/1", walk, 0, {"/a/1/b"}},
         {"/a/1", walk, self, {"/a/1", "/a/1/b"}},
         {"/a/1/c", walk, 0, {"?/a/1/c", "/a/1/c/1", "/a/1/c/2"}},
@@ -296,12 +296,12 @@ TEST(client, monitoring_walk) {
         {"/s", walk, tree | leaves, {"/s/x/y"}},
         {"/s/x/y", walk, 0, {}},
         {"/s/x/y", walk, self, {"/s/x/y"}},
-        {"/", walk, 0, {}}, // nothing registered directly below
+        {"/", walk, 0, {}}, // no registered child
     };
     for (const auto &row : cases) {
         SCOPED_TRACE(std::string(row.name) + " " + std::to_string(row.flags));
         monitored daemon;
-        daemon.add_node(row.name, row.subop, row.flags); // before what it is looked up in
+        daemon.add_node(row.name, row.subop, row.flags); // the query comes before the registrations
         daemon.add_registered({"/a/*", "/a/*/b", "/a/*/c/*", "/s/x", "/s/x", "/s/x/y"});
         ASSERT_EQ(daemon.dispatch(), 0);
         EXPECT_EQ(daemon.asked, row.asked);
@@ -321,7 +321,7 @@ TEST(client, monitoring_answers) {
     monitored several;
     several.add_registered({deep, deep + "/e"});
     several.add_registered(strings(63, deep));
-    several.add_registered({"/late", "/later"}); // beyond the bound on all of them
+    several.add_registered({"/late", "/later"}); // beyond the limit for all names
     several.add_node("/odd", bn_query_none);
     several.add_node(deep, bn_query_iterate, bn_qf_include_self);
     several.add_node(deep + "/e", bn_query_iterate, bn_qf_include_self);
@@ -337,7 +337,7 @@ TEST(client, monitoring_answers) {
     EXPECT_EQ(lines.find("/later"), std::string::npos);
     EXPECT_NE(lines.find("Unexpected query subop 0; ignoring request for binding /odd"), std::string::npos);
 
-    for (const lc_status status : {LC_NULL, LC_ASSERTION, LC_BAD_TYPE}) { // and no answer goes
+    for (const lc_status status : {LC_NULL, LC_ASSERTION, LC_BAD_TYPE}) { // and no answer is sent
         monitored failing;
         if (status == LC_NULL)
             failing.add_node("/a", bn_query_registration_info);
@@ -348,7 +348,7 @@ TEST(client, monitoring_answers) {
         EXPECT_EQ(failing.dispatch(), status);
         EXPECT_EQ(failing.answer(), strings{"(none)"});
     }
-    monitored large; // it is not asked for more than a message holds
+    monitored large; // it is not asked for more than fits in a message
     large.value.resize(1 << 20, 'v');
     large.add_registered({"/a/*", "/a/*/b"});
     for (int i = 0; i < 14; i++)

@@ -1,5 +1,5 @@
-// A session that engine threads send on while a loop of its own thread drives it, as alarms and state events
-// are sent. WCCP_STRESS=1 makes it the long form: a minute of sending, a thousand closings.
+// A session on which other threads send while its own thread runs its loop, as for alarms and state events.
+// With WCCP_STRESS=1 it runs longer: a minute of sending, a thousand closings.
 #include <atomic>
 #include <cstdlib>
 #include <map>
@@ -14,8 +14,7 @@
 #include "runtime/ttime.h"
 #include "tests/support/gcl_client.h"
 
-// A cancelled thread ends with its stack still marked; the sanitizer then trips over its own last write
-// there.
+// The stack of a cancelled thread keeps its marks, and the sanitizer then reports its own last write there.
 extern "C" const char *__asan_default_options();
 extern "C" const char *__asan_default_options() {
     return "use_sigaltstack=0";
@@ -27,7 +26,7 @@ bool stress() {
     const char *value = getenv("WCCP_STRESS");
     return value && *value && *value != '0';
 }
-// The alarm client: a thread that makes the session, opens it and runs its loop.
+// Like the alarm client: a thread that makes the session, opens it and runs its loop.
 struct session_thread {
     gcl_client client;
     std::atomic<int> ready{0}, ended{0}, acknowledged{0};
@@ -59,8 +58,7 @@ struct session_thread {
     }
 };
 
-// An engine thread: it holds the engine's lock while it sends, and is cancelled at any moment and started
-// again.
+// Like an engine thread: it holds a lock while it sends, and is cancelled at any moment and started again.
 struct sender {
     session_thread *to = nullptr;
     pthread_mutex_t *engine = nullptr;
@@ -112,7 +110,7 @@ void start_all(sender (&senders)[Count], session_thread *session) {
     }
 }
 
-// Every frame of every sender arrives whole, once and in its order, whatever the provider's pace.
+// All frames of all senders arrive complete, once and in order, at whatever pace the provider reads.
 TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
     gcl_provider provider;
     ASSERT_TRUE(provider.listen_as("mgmtd"));
@@ -121,7 +119,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
     sender senders[3];
     start_all(senders, &session);
     std::atomic<bool> over{false};
-    // Cancelled at any moment, again and again: what it was sending goes out whole, and is counted as sent.
+    // Cancelled at random moments: the frame that it was sending is still sent completely and counted.
     std::thread canceller([&] {
         std::minstd_rand random(7);
         while (!over) {
@@ -180,8 +178,8 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
     printf("%u frames, %u acknowledgements\n", frames, acknowledged);
 }
 
-// The provider closes at random moments, while the loop's thread reads and others send. The session ends on
-// its own thread, once, whoever found it; nobody hangs.
+// The provider closes at random moments, while the loop's thread reads and others send. Whichever thread
+// notices, the close handler is called once, on the session's own thread, and no thread hangs.
 TEST(GclThreads, AProviderThatClosesWhileOthersSend) {
     gcl_provider provider;
     ASSERT_TRUE(provider.listen_as("mgmtd"));

@@ -1,4 +1,4 @@
-// Sessions against a provider made of raw bytes: the opening, the frame reader, the output queue.
+// Sessions with a provider that is written as raw bytes: opening, the frame reader, the output queue.
 #include <atomic>
 #include <csignal>
 #include <mutex>
@@ -47,7 +47,7 @@ struct Gcl : testing::Test {
         client.on_frame = nullptr;
     }
     void round() { ASSERT_EQ(lew_dispatch_once(client.wrapper, nullptr, nullptr), LC_OK); }
-    // Takes what the session sends, in a thread, while the loop runs.
+    // Receives what the session sends, in a thread, while the loop runs.
     std::vector<wire> taken(int count) {
         std::vector<wire> got;
         std::thread other([&] {
@@ -60,7 +60,7 @@ struct Gcl : testing::Test {
         other.join();
         return got;
     }
-    // The loop waits without being woken; it has ended afterwards.
+    // The loop waits without waking up. It has ended afterwards.
     void expect_idle() {
         const clock_t used = clock();
         std::thread other([&] {
@@ -166,7 +166,7 @@ TEST_F(Gcl, ThePeersIdsAreChecked) {
     drop();
 }
 
-TEST_F(Gcl, ARefusedServiceIsNoOpenService) {
+TEST_F(Gcl, ARefusedServiceIsNotOpen) {
     connect();
     std::thread other([&] {
         ASSERT_TRUE(provider.accept_client());
@@ -189,7 +189,7 @@ TEST_F(Gcl, ARefusedServiceIsNoOpenService) {
     other.join();
 }
 
-TEST_F(Gcl, APeerThatNeverAnswersOrGoes) {
+TEST_F(Gcl, APeerThatNeverAnswersOrCloses) {
     connect();
     const int64_t start = lt_monotonic_ms();
     EXPECT_EQ(client.open(150), LC_IO_TIMED_OUT);
@@ -197,7 +197,7 @@ TEST_F(Gcl, APeerThatNeverAnswersOrGoes) {
     EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
     ASSERT_TRUE(provider.accept_client());
     ASSERT_TRUE(provider.put(greeting_bytes(~0u, ~0u).substr(0, 60)));
-    provider.close_client(); // in mid-frame
+    provider.close_client(); // in the middle of a frame
     EXPECT_EQ(client.open(), LC_IO_CLOSED);
     EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
     EXPECT_EQ(client.closes, 1);
@@ -206,8 +206,7 @@ TEST_F(Gcl, APeerThatNeverAnswersOrGoes) {
     EXPECT_EQ(client.closes, 1);
 }
 
-// Each timer of the interest list runs once in a wait, when it is due, in whatever order they were
-// registered.
+// Each timer of the interest list runs once during a wait, when it is due, in whatever order they were added.
 TEST_F(Gcl, TimersRunInAWait) {
     connect();
     std::vector<intptr_t> ran;
@@ -225,7 +224,7 @@ TEST_F(Gcl, TimersRunInAWait) {
     EXPECT_EQ(ran, (std::vector<intptr_t>{0, 30, 80}));
 }
 
-// The signals that end the process are blocked in the thread that waits; one that comes ends the attempts.
+// The signals that end the process are blocked in the thread that connects; a pending one ends the attempts.
 TEST_F(Gcl, ConnectingEndsWithTheProcess) {
     sigset_t end;
     sigemptyset(&end);
@@ -264,7 +263,7 @@ TEST_F(Gcl, NamesAndNumbersThatAreRefused) {
     EXPECT_EQ(own, "UNKNOWN-" + std::to_string(geteuid()) + "." + std::to_string(getpid()));
 }
 
-TEST_F(Gcl, NobodyThere) {
+TEST_F(Gcl, WithoutAProvider) {
     gcl_log log;
     ASSERT_EQ(client.make(), LC_OK);
     EXPECT_EQ(client.send(1, "early"), LC_GENERIC);
@@ -278,7 +277,7 @@ TEST_F(Gcl, NobodyThere) {
     EXPECT_EQ(log.count("Error code"), 0);
     EXPECT_EQ(gcl_session_client_connect_by_provider(client.session, "mgmtd", 0), LC_GENERIC);
     EXPECT_EQ(log.count("client called to connect in invalid state: 1 (closed)"), 1);
-    expect_idle(); // neither spins over the closed descriptor nor ends
+    expect_idle(); // neither spins on the closed descriptor nor ends
 
     ASSERT_EQ(client.make(), LC_OK);
     gcl_provider late;
@@ -393,7 +392,7 @@ TEST_F(Gcl, BadFramesEndTheSessionAndForeignOnesDoNot) {
         EXPECT_EQ(client.state(), row.closes ? GCL_SESSION_CLOSED : GCL_SESSION_CONNECTED) << row.line;
         EXPECT_EQ(client.closes, row.closes ? 1 : 0) << row.line;
         EXPECT_LE(client.frames.size(), 1u) << row.line;
-        if (!row.closes) { // what follows is read as before
+        if (!row.closes) { // later frames are read
             client.frames.clear();
             ASSERT_TRUE(provider.put(good));
             until([&] { return client.frames.size() == 1; });
@@ -402,8 +401,8 @@ TEST_F(Gcl, BadFramesEndTheSessionAndForeignOnesDoNot) {
     }
 }
 
-// A frame of the largest size that is announced and never sent takes no memory for what has not come.
-TEST_F(Gcl, AnAnnouncedLengthTakesNoMemory) {
+// The header of a frame of the largest size takes no memory for bytes that have not been received.
+TEST_F(Gcl, ALengthInAHeaderTakesNoMemory) {
     open();
     wire header = frame_bytes(3, 1, "").replace(12, 4, be(16 << 20, 4));
     const auto resident = [] {
@@ -420,10 +419,9 @@ TEST_F(Gcl, AnAnnouncedLengthTakesNoMemory) {
     EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
 }
 
-// A handler waits in the loop for later frames. Inside, the buffer moves, grows past its first size, and is
-// emptied, while the outer round still has frames to deliver; each piece that is sent ends in the middle of a
-// frame.
-TEST_F(Gcl, TheReaderNests) {
+// A handler runs the loop to wait for later frames. Meanwhile the buffer is moved, enlarged and emptied,
+// although the outer call still has frames to deliver; each piece that is sent ends in the middle of a frame.
+TEST_F(Gcl, TheReaderIsReentrant) {
     open();
     const wire wait = frame_bytes(3, 1, "wait"), cut = frame_bytes(3, 3, "cut in two");
     const wire piece = cut.substr(20) + frame_bytes(3, 2, wire(500000, 'y')) + cut.substr(0, 20);
@@ -462,9 +460,9 @@ TEST_F(Gcl, TheReaderNests) {
     EXPECT_EQ(count[3], 4u);
 }
 
-// The session ends while its reader is in a handler: closed by the peer in an inner round, closed by the
-// handler, or freed by it.
-TEST_F(Gcl, TheSessionGoesUnderItsReader) {
+// The session ends while a handler runs: closed by the peer in a nested round, closed by the handler, or
+// freed by it.
+TEST_F(Gcl, TheSessionEndsDuringAHandler) {
     for (int way = 0; way < 3; way++) {
         open();
         client.on_frame = [&, way](const wire &) {
@@ -481,7 +479,7 @@ TEST_F(Gcl, TheSessionGoesUnderItsReader) {
         };
         ASSERT_TRUE(provider.put(frame_bytes(3, 1, "a") + frame_bytes(3, 1, "b")));
         round();
-        // What had come before the peer closed is delivered; after a close of our own nothing is.
+        // What was received before the peer closed is delivered; after our own close nothing is.
         EXPECT_EQ(client.frames.size(), way == 0 ? 2u : 1u) << way;
         EXPECT_EQ(client.closes, 1) << way;
         if (way < 2)
@@ -491,7 +489,7 @@ TEST_F(Gcl, TheSessionGoesUnderItsReader) {
 
 // ---- The output queue
 
-TEST_F(Gcl, FramesGoOutWholeAndInOrder) {
+TEST_F(Gcl, FramesAreSentCompletelyAndInOrder) {
     open();
     constexpr int count = 40;
     const auto body = [](int i) { return wire(50000, static_cast<char>('A' + i % 26)); };
@@ -511,7 +509,7 @@ TEST_F(Gcl, FramesGoOutWholeAndInOrder) {
                   frame_bytes(3, static_cast<uint16_t>(i + 1), body(i), 2000003 + static_cast<uint32_t>(i)));
     EXPECT_EQ(got[count], frame_bytes(3, 99, "in place", 2000003 + count));
     EXPECT_EQ(got[count + 1], frame_bytes(3, 98, "put", 2000004 + count));
-    expect_idle(); // not woken for a writable socket
+    expect_idle(); // does not wait for a writable socket
 }
 
 TEST_F(Gcl, ARateLimitSpreadsAFrameOverTime) {
@@ -524,7 +522,7 @@ TEST_F(Gcl, ARateLimitSpreadsAFrameOverTime) {
     EXPECT_NEAR(static_cast<double>(lt_monotonic_ms() - start), 400, 200);
 }
 
-TEST_F(Gcl, AQueueThatFillsLosesFramesAndSaysSoOnce) {
+TEST_F(Gcl, AFullQueueDropsFramesAndLogsOnce) {
     gcl_log log;
     open();
     const wire body(65536, 'q');
@@ -546,7 +544,7 @@ TEST_F(Gcl, AQueueThatFillsLosesFramesAndSaysSoOnce) {
     }
 }
 
-TEST_F(Gcl, SessionsEndUnderTheirQueue) {
+TEST_F(Gcl, SessionsEndWithAQueue) {
     open();
     provider.close_client();
     EXPECT_EQ(client.send(1, "to nobody"), LC_OK);

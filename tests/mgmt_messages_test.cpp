@@ -1,4 +1,4 @@
-// Messages by their bytes, what a reader refuses, and the way of a message over a session into its callback.
+// Messages byte by byte, what is refused when they are read, and how they reach the callback of a session.
 #include <gtest/gtest.h>
 #include <malloc.h>
 
@@ -62,7 +62,7 @@ static lc_status read_request(const wire &bytes, bn_request_msg **out) {
     return read(bn_request_msg_deserialize, bytes, out);
 }
 
-// Written it has these bytes, read and written again too, and everything shorter is refused.
+// The message is written as these bytes, also after reading them; anything shorter is refused.
 template <typename Owner, typename Message>
 static void expect_bytes(Message *msg, const wire &golden, lc_status (*to)(Message *, uint32_t, tbuffer **),
                          lc_status (*from)(const tbuffer *, uint32_t, Message **)) {
@@ -133,7 +133,7 @@ TEST(messages, request_bytes) {
     EXPECT_EQ(bn_query_request_msg_append_str(event, bn_query_get, 0, "/a", nullptr), LC_ASSERTION);
 }
 
-// A query asks for attributes by their ids alone; a registration carries them.
+// A query asks for attributes by id; a registration contains them.
 TEST(messages, attributes_asked_for) {
     binding_owner mask;
     ASSERT_EQ(bn_binding_new_uint32(&mask, "/m", bn_attrib_capability_mask, 0, 6), 0);
@@ -151,7 +151,7 @@ TEST(messages, attributes_asked_for) {
     }
 }
 
-// Messages that were made here and messages that were received read alike.
+// Messages that were built and messages that were received are read in the same way.
 TEST(messages, response_bytes_and_reading) {
     response_owner msg, copy;
     ASSERT_EQ(bn_query_response_msg_create(&msg, 41, 3, "no"), 0);
@@ -171,7 +171,7 @@ TEST(messages, response_bytes_and_reading) {
             if (received) {
                 ASSERT_EQ(read(bn_response_msg_deserialize, room + response(2, bytes), &from), 0);
             }
-            for (int round = 0; round < 3; round++) { // by copy, by takeover, from what that left
+            for (int round = 0; round < 3; round++) { // by copy, by takeover, and from what is left
                 uint32_t code = 0;
                 string_owner message;
                 bindings_owner bindings;
@@ -203,8 +203,8 @@ TEST(messages, response_bytes_and_reading) {
     }
 }
 
-// Lengths that no bytes follow, and values that are malformed.
-TEST(messages, lies_are_refused) {
+// Lengths without the bytes, and malformed values.
+TEST(messages, false_fields_are_refused) {
     const wire start = room + request(7, str("")), node = u32(1) + u32(1000) + u8(1);
     const wire named = start + node + u32(1) + str("n"), huge = u32(UINT32_MAX);
     const wire bodies[] = {
@@ -222,7 +222,7 @@ TEST(messages, lies_are_refused) {
     }
 }
 
-// In each place of a message that takes a text; bytes may be any.
+// In each text of a message; binary values may contain any bytes.
 TEST(messages, a_nul_in_a_text_is_refused) {
     const wire start = u32(1) + u32(1000) + u8(1), bare = u32(0) + u32(0),
                trailer = u32(0) + str("") + u32(0);
@@ -266,8 +266,8 @@ static size_t allocated() {
     const struct mallinfo2 info = mallinfo2();
     return info.uordblks + info.hblkhd;
 }
-// A received message, and each copy of its bindings, takes at most eight times its bytes, whatever a peer
-// puts in it; the parts of the names, for those who ask for them, at most nine.
+// A received message, and each copy of its bindings, takes at most eight times its bytes, whatever it
+// contains; the parts of the names, if they are wanted, at most nine.
 TEST(messages, received_messages_are_bounded) {
     const wire name = u8(1) + u32(1) + str("n"),
                none = u32(1) + u32(130) + u32(bn_type_none) + u32(0) + u32(0);
@@ -337,8 +337,8 @@ TEST(messages, received_messages_are_bounded) {
         }
 }
 
-// A binding that came with a message outlives it, may be changed and copied, and gives away what it has.
-TEST(messages, received_bindings_are_their_takers) {
+// A received binding can outlive its message, be changed and copied, and give away its name and attributes.
+TEST(messages, received_bindings_can_be_kept) {
     const wire node = u32(1000) + u8(1) + u32(1) + str("n") + u32(3) + text_attribute(1, bn_type_str, "v") +
                       text_attribute(65, bn_type_binary, "b") + u32(1) + u32(129) + u32(bn_type_uint32) +
                       u32(0) + u32(4) + u32(7);
@@ -394,7 +394,7 @@ TEST(messages, received_bindings_are_their_takers) {
 
 TEST(messages, odd_messages_are_read) {
     const wire start = room + request(7, str("") + u32(1) + u32(1000));
-    for (uint32_t absolute : {0u, 1u}) { // a name of no parts
+    for (uint32_t absolute : {0u, 1u}) { // a name without parts
         request_owner msg;
         bindings_owner bindings;
         ASSERT_EQ(read_request(start + u8(absolute) + u32(0) + u32(0) + str("e"), &msg), 0);
@@ -433,14 +433,14 @@ struct MessageSession : testing::Test {
         auto *self = static_cast<MessageSession *>(data);
         self->calls += std::to_string(msg->msg_type) + " ";
         if (msg->msg_type != bn_msg_query_request)
-            return LC_BAD_TYPE; // what a callback returns is dropped
+            return LC_BAD_TYPE; // the result of a callback is ignored
         response_owner answer;
         EXPECT_EQ(bn_query_response_msg_create(&answer, msg->msg_id, 0, nullptr), 0);
         return bn_response_msg_send(session, answer);
     }
     static wire message(uint32_t type) {
         if (type % 2 == 0 && type >= 2 && type <= 8)
-            return response(type, u32(0) + str("told") + u32(0) + (type < 6 ? u32(1) : wire()));
+            return response(type, u32(0) + str("message") + u32(0) + (type < 6 ? u32(1) : wire()));
         const wire trailer = type < 5 ? u32(0) + str("") + u32(0) : str("/name");
         return request(type, str("") + u32(0) + (type < 8 && type % 2 ? trailer : wire()));
     }
@@ -468,7 +468,7 @@ TEST_F(MessageSession, EachTypeReachesItsCallback) {
     EXPECT_EQ(number_at(answer, 48), 7u);
 }
 
-TEST_F(MessageSession, WhatNobodyTakesIsTold) {
+TEST_F(MessageSession, WhatIsNotHandledIsLogged) {
     ASSERT_TRUE(with.open());
     bn_set_global_callback_query_request_msg(with.instance, note, this); // too late for this session
     const struct {
@@ -477,20 +477,21 @@ TEST_F(MessageSession, WhatNobodyTakesIsTold) {
         const char *line;
     } cases[] = {
         {1, message(1), "session 1: proto bnode: no query request callback"},
-        {2, message(2), "session 1: proto bnode: no query response callback: code = 0 msg = told"},
+        {2, message(2), "session 1: proto bnode: no query response callback: code = 0 msg = message"},
         {3, message(3), "session 1: proto bnode: no set request callback"},
-        {4, message(4), "session 1: proto bnode: no set response callback: code = 0 msg = told"},
+        {4, message(4), "session 1: proto bnode: no set response callback: code = 0 msg = message"},
         {5, message(5), "session 1: proto bnode: no action request callback"},
-        {6, message(6), "session 1: proto bnode: no action response callback: code = 0 msg = told"},
+        {6, message(6), "session 1: proto bnode: no action response callback: code = 0 msg = message"},
         {7, message(7), "session 1: proto bnode: no event request callback"},
-        {8, message(8), "session 1: proto bnode: no event response callback: code = 0 msg = told"},
+        {8, message(8), "session 1: proto bnode: no event response callback: code = 0 msg = message"},
         {0, message(0), "session 1: proto bnode: invalid body message type 0"},
         {9, message(9), "session 1: proto bnode: invalid body message type 9"},
         {10, message(10), "session 1: proto bnode: invalid body message type 10"},
         {7, message(9), "session 1: proto bnode: invalid body message type 9"},
         {9, message(7), "session 1: proto bnode: invalid body message type 9"},
         {2, response(10, u32(0) + str("") + u32(0)), "session 1: proto bnode: invalid body message type 10"},
-        {2, response(7, u32(0) + str("told") + u32(0)), "no event response callback: code = 0 msg = told"},
+        {2, response(7, u32(0) + str("message") + u32(0)),
+         "no event response callback: code = 0 msg = message"},
         {2, wire("\x00\x03", 2) + message(2).substr(2), "session 1: service 3 not open: 2"},
     };
     for (const auto &row : cases) {
@@ -536,8 +537,8 @@ TEST_F(MessageSession, SentMessagesAreNumbered) {
     EXPECT_EQ(log.count("Dropping response to non-connected session 1"), 1);
 }
 
-// The asker gets a code and words, also when the queue has no room left at all.
-TEST_F(MessageSession, AnAnswerThatDoesNotFitIsRefused) {
+// The peer gets a code and a message, also if the queue is completely full.
+TEST_F(MessageSession, AResponseThatDoesNotFitIsReplaced) {
     ASSERT_TRUE(with.open());
     const auto answer = [&](size_t bytes) {
         response_owner response;
@@ -572,7 +573,7 @@ TEST_F(MessageSession, AnAnswerThatDoesNotFitIsRefused) {
     EXPECT_EQ(log.count("Error code"), 0);
 }
 
-TEST_F(MessageSession, WhatIsSentIsDumped) {
+TEST_F(MessageSession, SentMessagesAreLogged) {
     ASSERT_TRUE(with.open());
     ASSERT_EQ(lc_log_set_max_log_level("debug"), 0);
     const auto dump_of = [&](auto send) {

@@ -1,5 +1,4 @@
-// The platform's files: what is read is bounded and what is bad in them loses nothing else; what is written
-// is there as a whole or not at all.
+// The platform's files: bad lines don't affect good ones; a file is written completely or not at all.
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -60,7 +59,7 @@ struct Files : testing::Test {
 
 } // namespace
 
-TEST_F(Files, LimitsComeFromTheLinesThatAreGood) {
+TEST_F(Files, LimitsComeFromTheGoodLines) {
     const struct {
         std::string text;
         uint32_t tunnels, interfaces;
@@ -70,14 +69,14 @@ TEST_F(Files, LimitsComeFromTheLinesThatAreGood) {
         {"# max_user_tunnels 5\n\n   \n\tmax_interfaces\t 127  ", 200, 127},
         {"max_user_tunnels 0\nmax_interfaces 65535", 0, 65535},
         {"max_user_tunnels 65000\r\nmax_interfaces 1\r\n", 65000, 1},
-        // bad lines, each beside a good one
+        // bad lines, each with a good one
         {"max_user_tunnels 65001\nmax_interfaces 9", 200, 9},
         {"max_interfaces 0\nmax_user_tunnels 3", 3, 128},
         {"max_interfaces -1\nmax_interfaces +4\nmax_interfaces 0x10\nmax_interfaces 12 13\nmax_interfaces\n"
          "max_interfaces \nmax_interfaces twelve\nmax_interfaces 4294967424\nmax_interfaces "
          "99999999999999999999999\nmax_interfacesx 3\nMAX_INTERFACES 3\nmax_interface 3\nmax_user_tunnels 8",
          8, 128},
-        // A line longer than any good one is one bad line, not several; a NUL hides nothing after it.
+        // A line that is too long is one bad line, not several; a NUL does not hide what follows it.
         {"max_interfaces 5" + std::string(5000, ' ') + "\nmax_user_tunnels 6\n", 6, 128},
         {std::string(126, '#') + "\nmax_user_tunnels 6\na" + '\0' + "b\nmax_interfaces 7\n", 6, 7},
     };
@@ -89,7 +88,7 @@ TEST_F(Files, LimitsComeFromTheLinesThatAreGood) {
     }
     EXPECT_EQ(platform_limits_read((dir / "none").c_str()).max_interfaces, 128u);
     EXPECT_EQ(platform_limits_read(dir.c_str()).max_interfaces, 128u);
-    // The shipped file says what a missing one means.
+    // The file that is shipped has the defaults.
     const platform_limits shipped = platform_limits_read(WCCP_SOURCE_DIR "/packaging/platform.conf");
     EXPECT_TRUE(shipped.max_user_tunnels == 200 && shipped.max_interfaces == 128);
     EXPECT_TRUE(fs::exists(WCCP_SOURCE_DIR "/packaging/platform.conf"));
@@ -102,14 +101,14 @@ TEST_F(Files, LimitsComeFromTheLinesThatAreGood) {
     EXPECT_EQ(qv_max_interfaces(), 128u);
 }
 
-TEST_F(Files, MissingDirectoriesAreMadeWithTheMode) {
+TEST_F(Files, MissingDirectoriesAreCreatedWithTheMode) {
     const auto ensure = [](const fs::path &path) { return lf_ensure_dir_of_file(path.c_str(), 0755); };
     EXPECT_EQ(ensure(dir / "a//b/./c/file"), LC_OK);
-    EXPECT_TRUE(mode_of(dir / "a") == 0755 && mode_of(dir / "a/b/c") == 0755) << "whatever the umask says";
+    EXPECT_TRUE(mode_of(dir / "a") == 0755 && mode_of(dir / "a/b/c") == 0755) << "regardless of the umask";
     EXPECT_FALSE(fs::exists(dir / "a/b/c/file"));
     fs::permissions(dir / "a", fs::perms(0700));
     EXPECT_EQ(ensure(dir / "a/other"), LC_OK);
-    EXPECT_EQ(mode_of(dir / "a"), 0700u) << "what was there is left alone";
+    EXPECT_EQ(mode_of(dir / "a"), 0700u) << "an existing directory is not changed";
     fs::create_directory_symlink("a/b", dir / "link");
     EXPECT_EQ(ensure(dir / "link/d/file"), LC_OK);
     EXPECT_TRUE(fs::is_directory(dir / "a/b/d"));
@@ -128,18 +127,18 @@ TEST_F(Files, AFileHasExactlyTheBytesAndTheMode) {
              {std::string("a\0b\n", 4), 0644}, {"9", 0600}, {"", 0600}}) {
         EXPECT_EQ(write(path, text, 1, mode), LC_OK);
         EXPECT_EQ(text_of(path), text);
-        EXPECT_EQ(mode_of(path), mode) << "whatever the umask says";
+        EXPECT_EQ(mode_of(path), mode) << "regardless of the umask";
     }
     EXPECT_EQ(write(path, "new", 0), LC_IO_FILE_EXISTS);
     EXPECT_EQ(errno, EEXIST);
     EXPECT_EQ(text_of(path), "");
     EXPECT_EQ(write(dir / "fresh", "new", 0), LC_OK);
-    EXPECT_EQ(names_in(dir), 2u) << "and nothing else";
+    EXPECT_EQ(names_in(dir), 2u) << "and no temporary file";
     EXPECT_EQ(write(dir / "none/file", "x"), LC_FILE_NOT_FOUND);
     EXPECT_EQ(errno, ENOENT);
 }
 
-TEST_F(Files, WhatIsNotAPlainFileIsRefused) {
+TEST_F(Files, OnlyPlainFilesAreReplaced) {
     write_text(dir / "target", "old");
     fs::create_symlink(dir / "target", dir / "link");
     fs::create_symlink(dir / "nowhere", dir / "dangling");

@@ -1,5 +1,5 @@
-// Interfaces that come, go and change under the notifications: whatever happens, and in whatever order or
-// number it hears of them, what a program knows at the end is what the kernel has.
+// Interfaces that are added, deleted and changed: whatever happens, and in whatever order and number a
+// program gets the notifications, in the end it knows the state of the kernel.
 
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
@@ -31,7 +31,7 @@ using namespace std::chrono_literals;
 
 namespace {
 
-// "1/1": administratively up, and carrying.
+// "1/1": administratively up, and running.
 std::string kernel_state(const std::string &name) {
     ifreq request = {};
     strncpy(request.ifr_name, name.c_str(), IFNAMSIZ - 1);
@@ -51,16 +51,17 @@ std::string kernel_address(const std::string &name) {
     return inet_ntoa(address.sin_addr);
 }
 
-// What a program knows that follows the notifications and reads an address when told to, as the engine does.
-struct picture {
+// What a program knows that follows the notifications, and queries an address when it has changed, as the
+// engine does.
+struct known_state {
     std::mutex mutex;
     std::condition_variable changed;
     std::map<std::string, std::string> links, addresses;
-    std::vector<std::string> told; // "name 1/1", "name 10.9.0.1"
-    size_t stack = 0;              // of the library's thread
+    std::vector<std::string> reported; // "name 1/1", "name 10.9.0.1"
+    size_t stack = 0;                  // of the library's thread
     sigset_t blocked;
-    bool held = false;    // the callbacks wait
-    bool waiting = false; // one does
+    bool held = false;    // callbacks wait
+    bool waiting = false; // a callback waits
 
     void take(const std::string &name, bool address, const std::string &link) {
         std::unique_lock lock(mutex);
@@ -70,7 +71,7 @@ struct picture {
         waiting = false;
         const std::string now = address ? kernel_address(name) : link;
         (address ? addresses : links)[name] = now;
-        told.push_back(name + " " + now);
+        reported.push_back(name + " " + now);
         pthread_attr_t attributes;
         pthread_getattr_np(pthread_self(), &attributes);
         pthread_attr_getstacksize(&attributes, &stack);
@@ -79,7 +80,7 @@ struct picture {
         changed.notify_all();
     }
 };
-picture *seen; // never freed: the library's thread outlives everything
+known_state *seen; // never freed, since the library's thread runs to the end
 
 void on_link(const void *argument) {
     const auto *info = static_cast<const qv_if_state_info *>(argument);
@@ -102,9 +103,9 @@ void shell(const std::string &command) {
 void start(void (*between_the_kinds)() = [] {}) {
     if (seen)
         return;
-    seen = new picture;
+    seen = new known_state;
     qvif_network_init_sockets();
-    EXPECT_NE(qv_start_netlink_monitor(QV_NOTIFY_LINK_STATE), 0) << "nobody has registered";
+    EXPECT_NE(qv_start_netlink_monitor(QV_NOTIFY_LINK_STATE), 0) << "without a callback";
     EXPECT_NE(qv_register_netlink_notifier(2, on_link), 0);
     EXPECT_NE(qv_register_netlink_notifier(0, nullptr), 0);
     ASSERT_EQ(qv_register_netlink_notifier(QV_NOTIFY_LINK_STATE, on_link), 0);
@@ -114,8 +115,7 @@ void start(void (*between_the_kinds)() = [] {}) {
     ASSERT_EQ(qv_start_netlink_monitor(QV_NOTIFY_IPA_CHANGE), 0);
 }
 
-// Leaves a change of a link in the queue that the start of the other kind empties: a callback waits
-// meanwhile.
+// Leaves a change of a link in the queue, which the start of the other kind empties, while a callback waits.
 void change_early() {
     shell("ip link add early type veth peer name other && ip link set other up && ip link set early up");
     std::unique_lock lock(seen->mutex);
@@ -163,12 +163,12 @@ std::string difference_to_the_kernel() { // seen->mutex held
     return difference;
 }
 
-// Once nothing has been told for a while, everything that is there or was ever told is known as the kernel
-// has it.
-testing::AssertionResult picture_is_the_kernels() {
+// Once nothing has been reported for a while, the state of all interfaces that exist or were ever reported is
+// that of the kernel.
+testing::AssertionResult state_is_the_kernels() {
     const auto give_up = std::chrono::steady_clock::now() + 10s;
     std::unique_lock lock(seen->mutex);
-    std::string difference = "not looked at";
+    std::string difference = "not compared";
     while (!difference.empty() && std::chrono::steady_clock::now() < give_up)
         if (seen->changed.wait_for(lock, 60ms) == std::cv_status::timeout)
             difference = difference_to_the_kernel();
@@ -176,13 +176,13 @@ testing::AssertionResult picture_is_the_kernels() {
                               : testing::AssertionFailure() << "wrong:" << difference;
 }
 
-void forget_told() {
+void forget_reported() {
     std::unique_lock lock(seen->mutex);
-    seen->told.clear();
+    seen->reported.clear();
 }
-bool was_told(const char *text) {
+bool was_reported(const char *text) {
     std::unique_lock lock(seen->mutex);
-    return std::find(seen->told.begin(), seen->told.end(), text) != seen->told.end();
+    return std::find(seen->reported.begin(), seen->reported.end(), text) != seen->reported.end();
 }
 
 struct Netlink : testing::Test {
@@ -191,7 +191,7 @@ struct Netlink : testing::Test {
         hold(false);
         shell("ip link add va type veth peer name vb && ip link set vb up && ip link set va up && "
               "ip addr add 10.9.0.1/24 dev va");
-        ASSERT_TRUE(picture_is_the_kernels());
+        ASSERT_TRUE(state_is_the_kernels());
         ASSERT_EQ(seen->addresses["va"], "10.9.0.1");
     }
     void TearDown() override {
@@ -199,7 +199,7 @@ struct Netlink : testing::Test {
         for (const std::string &name : kernel_names())
             if (name != "lo")
                 batch("link del " + name + "\n");
-        EXPECT_TRUE(picture_is_the_kernels());
+        EXPECT_TRUE(state_is_the_kernels());
     }
 };
 
@@ -210,9 +210,9 @@ struct Netlink : testing::Test {
     "unshare -n sleep 60 & other=$!; "                                                                       \
     "while [ $(readlink /proc/$other/ns/net) = $(readlink /proc/self/ns/net) ]; do sleep .01; done; "        \
     "ip link set va netns $other; "
-// What changes, and which of it is reported.
+// Changes, and what is reported of them.
 const struct {
-    const char *commands, *told, *never_told;
+    const char *commands, *reported, *never_reported;
 } changes[] = {
     {"ip link set vb down", "va 1/0", nullptr},
     {"ip link set va down", "va 0/0", nullptr},
@@ -222,7 +222,7 @@ const struct {
      "va 1/1", nullptr},
     {"ip link set va down && ip link set vb up", nullptr, nullptr},
     {"ip link del va", "va 0/0", nullptr},
-    {REMAKE, "va 0/0", nullptr}, // another interface under the old name
+    {REMAKE, "va 0/0", nullptr}, // another interface with the old name
     {"ip link set va down && ip link set va name vc && ip link set vc up", "va 0/0", nullptr},
     {"ip link set va down && ip link set va name vc && ip link set vb name va && ip link set vc name vb",
      nullptr, nullptr},
@@ -242,14 +242,15 @@ static int transported;
 extern "C" int qv_state_event_transport(uint32_t one, const char *group_id, uint32_t role,
                                         const uint8_t *code, gcl_session *) {
     EXPECT_TRUE(one == 1 && strcmp(group_id, "51") == 0 && role == 1 && *code == 237);
-    return transported++; // takes the first
+    return transported++; // accepts the first
 }
 
-TEST(Closed, StateEventsAreHandedOnToTheProgram) {
+TEST(Closed, StateEventsArePassedToTheProgram) {
     const uint8_t code = 237;
     EXPECT_EQ(qv_state_event_send(1, "51", 1, &code, nullptr), 0);
     EXPECT_EQ(qv_state_event_send(1, "51", 1, &code, nullptr), -1);
-    EXPECT_EQ(qv_state_event_send(1, "51", 1, &code, nullptr), -2) << "those that nobody took are counted";
+    EXPECT_EQ(qv_state_event_send(1, "51", 1, &code, nullptr), -2)
+        << "events that are not accepted are counted";
     EXPECT_EQ(transported, 3);
 }
 
@@ -270,7 +271,7 @@ TEST(Closed, TheInterfaceSocketIsOpenedOnce) {
 }
 
 TEST_F(Netlink, TheThreadIsSmallAndTakesNoSignal) {
-    EXPECT_EQ(seen->links["lo"], "1/1") << "what is there at the start is told";
+    EXPECT_EQ(seen->links["lo"], "1/1") << "reported at the start";
 #ifndef WCCP_SANITIZED
     EXPECT_LE(seen->stack, 128u * 1024);
 #endif
@@ -282,26 +283,26 @@ TEST_F(Netlink, TheThreadIsSmallAndTakesNoSignal) {
     EXPECT_EQ(blocked | 1ull << (SIGKILL - 1) | 1ull << (SIGSTOP - 1) | 3ull << 31, UINT64_MAX);
 }
 
-TEST_F(Netlink, EachChangeIsTold) {
+TEST_F(Netlink, EachChangeIsReported) {
     for (const auto &change : changes) {
-        forget_told();
+        forget_reported();
         shell(change.commands);
-        EXPECT_TRUE(picture_is_the_kernels()) << change.commands;
-        EXPECT_TRUE(!change.told || was_told(change.told)) << change.commands;
-        EXPECT_FALSE(change.never_told && was_told(change.never_told)) << change.commands;
+        EXPECT_TRUE(state_is_the_kernels()) << change.commands;
+        EXPECT_TRUE(!change.reported || was_reported(change.reported)) << change.commands;
+        EXPECT_FALSE(change.never_reported && was_reported(change.never_reported)) << change.commands;
         TearDown();
         SetUp();
     }
 }
 
-// A callback is blocked while the kernel's queue runs over many times; among the notifications that are
-// lost are the ones that count.
+// A callback is blocked while the kernel's queue overruns many times; the notifications that matter are among
+// those that are lost.
 TEST_F(Netlink, AnOverrunEndsInTheRightState) {
     for (const auto &change : changes) {
         if (strstr(change.commands, "sleep"))
-            continue; // slow ones
+            continue; // slow
         hold(true);
-        shell("ip link set lo down && ip link set lo up"); // one callback waits now
+        shell("ip link set lo down && ip link set lo up"); // a callback waits now
         {
             std::unique_lock lock(seen->mutex);
             ASSERT_TRUE(seen->changed.wait_for(lock, 10s, [] { return seen->waiting; }));
@@ -309,14 +310,14 @@ TEST_F(Netlink, AnOverrunEndsInTheRightState) {
         for (int i = 0; i < 3000; i++)
             ASSERT_EQ(flip("va", i % 2), 0);
         shell(change.commands);
-        forget_told();
+        forget_reported();
         hold(false);
-        ASSERT_TRUE(picture_is_the_kernels()) << change.commands;
+        ASSERT_TRUE(state_is_the_kernels()) << change.commands;
         {
             std::unique_lock lock(seen->mutex);
-            EXPECT_LT(seen->told.size(), 2000u) << "the queue did not run over";
+            EXPECT_LT(seen->reported.size(), 2000u) << "the queue did not overrun";
         }
-        EXPECT_TRUE(strcmp(change.commands, REMAKE) != 0 || was_told("va 0/0"));
+        EXPECT_TRUE(strcmp(change.commands, REMAKE) != 0 || was_reported("va 0/0"));
         TearDown();
         SetUp();
     }
@@ -344,12 +345,12 @@ TEST_F(Netlink, AnyOrderOfEverythingEndsInTheRightState) {
             hold(true);
         batch(commands);
         hold(false);
-        ASSERT_TRUE(picture_is_the_kernels()) << "round " << round;
+        ASSERT_TRUE(state_is_the_kernels()) << "round " << round;
     }
 }
 
-// The library's thread is in the middle of its work while exit() takes the process down. Streams are flushed
-// after the last destructor, those of libraries included.
+// The library's thread is busy while exit() runs. Streams are flushed after the last destructor, also after
+// those of libraries.
 static ssize_t draw_out(void *, const char *, size_t count) {
     usleep(100000);
     return static_cast<ssize_t>(count);
@@ -360,14 +361,14 @@ TEST(Exit, DISABLED_Child) {
     std::thread([] {
         for (bool up = true;; up = !up)
             if (flip("lo", up) != 0)
-                _exit(3); // nothing would happen in this process
+                _exit(3); // the test would not test anything
     }).detach();
     std::this_thread::sleep_for(50ms);
     fputs("unflushed", fopencookie(nullptr, "w", {nullptr, draw_out, nullptr, nullptr}));
     exit(0);
 }
 
-TEST(Exit, NothingThatTheThreadTouchesIsTornDown) {
+TEST(Exit, NothingThatTheThreadUsesIsDestroyed) {
     for (int i = 0; i < 10; i++) {
         const pid_t child = fork();
         if (child == 0) {

@@ -10,7 +10,9 @@
 #include "runtime/logging.h"
 #include "tests/support/log_daemon.h"
 
-static lc_status inner(char check, lc_status status) {
+namespace {
+
+lc_status inner(char check, lc_status status) {
     if (check == 'q')
         CHECK_QUIET(status);
     if (check == 'n')
@@ -22,7 +24,7 @@ static lc_status inner(char check, lc_status status) {
     CHECK_STATUS(status);
     return LC_OK;
 }
-static lc_status outer(lc_status status) {
+lc_status outer(lc_status status) {
     CHECK_STATUS(inner('s', status));
     return LC_OK;
 }
@@ -31,8 +33,8 @@ struct Checks : testing::Test {
     log_daemon daemon;
     void SetUp() override { ASSERT_EQ(lc_log_init("check", nullptr, 0, 0x1060000, 7, 136, 1), LC_OK); }
     void TearDown() override { (void)lc_log_close(); }
-    // Function and text of each line, without the place.
-    std::string told() {
+    // Function and text of each line, without its place.
+    std::string logged() {
         static const std::regex form(".*\\[wccpd\\.ERR\\]: (.*)\\(\\), [a-z_]+\\.cpp:\\d+, build 1: (.*\n)");
         std::string lines;
         for (const std::string &line : daemon.take())
@@ -43,8 +45,8 @@ struct Checks : testing::Test {
 
 TEST_F(Checks, EachFailureHasItsLineAtEachLevel) {
     EXPECT_EQ(outer(LC_NOT_FOUND), LC_NOT_FOUND);
-    EXPECT_EQ(told(), "inner: Error code 14004 (item not found) returned\n"
-                      "outer: Error code 14004 (item not found) returned\n");
+    EXPECT_EQ(logged(), "inner: Error code 14004 (item not found) returned\n"
+                        "outer: Error code 14004 (item not found) returned\n");
     const struct {
         char check;
         lc_status status, result;
@@ -61,81 +63,69 @@ TEST_F(Checks, EachFailureHasItsLineAtEachLevel) {
     };
     for (const auto &each : cases) {
         EXPECT_EQ(inner(each.check, each.status), each.result);
-        EXPECT_EQ(told(), each.line ? "inner: " + std::string(each.line) + "\n" : "") << each.status;
+        EXPECT_EQ(logged(), each.line ? "inner: " + std::string(each.line) + "\n" : "") << each.status;
     }
 }
 
-TEST_F(Checks, TablesGiveNamesAndValues) {
+TEST_F(Checks, TablesAndWords) {
     int32_t value = 9;
-    EXPECT_EQ(lc_enum_to_string_quiet_null(lc_status_table, 14024), nullptr);
     EXPECT_EQ(lc_string_to_enum(lc_log_level_table, "Debug", &value), LC_BAD_TYPE);
     EXPECT_EQ(value, 0);
     EXPECT_STREQ(lc_enum_to_string_quiet(nullptr, 0), "ERROR-NO-MAP");
-    EXPECT_EQ(told(), "");
-    EXPECT_STREQ(lc_enum_to_string(lc_log_level_table, 8), "ERROR-NO-MAP");
-    EXPECT_NE(told().find("Could not find a mapping for enum value 8"), std::string::npos);
-    EXPECT_EQ(lc_string_to_enum(nullptr, "err", &value), LC_NULL);
-    EXPECT_NE(told().find("Unexpected NULL"), std::string::npos);
-}
-
-TEST(Words, BooleansAndPrefixes) {
-    int32_t value = 7;
     EXPECT_TRUE(lc_str_to_bool("ON", &value) == LC_OK && value == 1);
     EXPECT_TRUE(lc_str_to_bool("f", &value) == LC_OK && value == 0);
     for (const char *neither : {"1", "0", "True", "", "yes"})
         EXPECT_EQ(lc_str_to_bool(neither, &value), LC_BAD_TYPE) << neither;
     EXPECT_TRUE(lc_is_prefix("/QV", "/qv/wccpd", 1) && lc_is_suffix("/STATE", "a/state", 1));
-    EXPECT_FALSE(lc_is_prefix("/QV", "/qv/wccpd", 0) || lc_is_prefix("longer", "long", 0));
-    EXPECT_FALSE(lc_is_suffix("a long", "long", 0) || lc_is_suffix("x", nullptr, 0));
+    EXPECT_FALSE(lc_is_prefix("/QV", "/qv/wccpd", 0) || lc_is_prefix("longer", "long", 0) ||
+                 lc_is_suffix("a long", "long", 0) || lc_is_suffix("x", nullptr, 0));
+    EXPECT_EQ(logged(), "");
+    EXPECT_STREQ(lc_enum_to_string(lc_log_level_table, 8), "ERROR-NO-MAP");
+    EXPECT_NE(logged().find("Could not find a mapping for enum value 8"), std::string::npos);
+    EXPECT_EQ(lc_string_to_enum(nullptr, "err", &value), LC_NULL);
+    EXPECT_NE(logged().find("Unexpected NULL"), std::string::npos);
 }
 
-TEST(Strings, BoundedCopiesTellTheLengthWithoutTheBound) {
-    char text[8] = "abcdefg";
+TEST(Strings, BoundedCopiesAndFormattedTexts) {
+    char text[8] = "abcdefg", full[4] = {'w', 'x', 'y', 'z'};
     EXPECT_EQ(strlcpy(text, "12345678", sizeof text), 8u);
     EXPECT_EQ(strlcpy(text, "ab", 0), 2u);
     EXPECT_STREQ(text, "1234567");
     EXPECT_EQ(strlcpy(text, "abc", 4), 3u);
     EXPECT_EQ(strlcat(text, "defgh", sizeof text), 8u);
     EXPECT_STREQ(text, "abcdefg");
-    char full[4] = {'w', 'x', 'y', 'z'};
     EXPECT_EQ(strlcat(full, "12", sizeof full), 6u);
     EXPECT_EQ(memcmp(full, "wxyz", 4), 0);
-}
-
-TEST(Strings, FormattedTextsOfAnyLength) {
-    for (const uint32_t length : {0u, 1u, 99u, 100u, 101u, 5000u}) {
+    for (const uint32_t length : {0u, 99u, 100u, 5000u}) {
         const std::string wanted(length, 'x');
-        char *text = nullptr;
-        uint32_t told = 1;
-        ASSERT_EQ(snmprintf(&text, &told, "%s", wanted.c_str()), LC_OK);
-        const owned_text owner(text);
-        EXPECT_EQ(text, wanted);
-        EXPECT_EQ(told, length);
+        char *formatted = nullptr;
+        uint32_t out_length = 1;
+        ASSERT_EQ(snmprintf(&formatted, &out_length, "%s", wanted.c_str()), LC_OK);
+        const owned_text owner(formatted);
+        EXPECT_EQ(formatted, wanted);
+        EXPECT_EQ(out_length, length);
     }
 }
 
 TEST(Lock, OwnersNestingAndRefusals) {
     lc_lock *lock = nullptr, *plain = nullptr;
-    ASSERT_EQ(lc_lock_init(&lock, 1), 0);
-    ASSERT_EQ(lc_lock_init(&plain, 0), 0);
+    ASSERT_TRUE(lc_lock_init(&lock, 1) == 0 && lc_lock_init(&plain, 0) == 0);
     EXPECT_EQ(lc_lock_unlock(lock), 1);
-    EXPECT_EQ(lc_lock_lock(lock), 0);
-    EXPECT_EQ(lc_lock_lock(lock), 0);
-    EXPECT_EQ(lc_lock_unlock(lock), 0);
+    EXPECT_TRUE(lc_lock_lock(lock) == 0 && lc_lock_lock(lock) == 0 && lc_lock_unlock(lock) == 0);
     std::thread([lock] { EXPECT_EQ(lc_lock_unlock(lock), 1); }).join();
     EXPECT_EQ(lc_lock_deinit(&lock), 1); // still locked
     EXPECT_EQ(lc_lock_unlock(lock), 0);
-    // A thread that ends while it holds locks leaves them free, however deep.
+    // A thread that ends while it holds locks releases them at every level.
     std::thread([lock, plain] {
         lc_lock_lock(lock);
         lc_lock_lock(lock);
         lc_lock_lock(plain);
     }).join();
     for (lc_lock **each : {&lock, &plain}) {
-        EXPECT_EQ(lc_lock_lock(*each), 0);
-        EXPECT_EQ(lc_lock_unlock(*each), 0);
-        EXPECT_EQ(lc_lock_deinit(each), 0);
-        EXPECT_EQ(*each, nullptr);
+        EXPECT_TRUE(lc_lock_lock(*each) == 0 && lc_lock_unlock(*each) == 0);
+        EXPECT_TRUE(lc_lock_deinit(each) == 0 && *each == nullptr);
     }
     EXPECT_TRUE(lc_lock_lock(nullptr) == 1 && lc_lock_unlock(nullptr) == 1 && lc_lock_deinit(&lock) == 1);
 }
+
+} // namespace

@@ -15,15 +15,16 @@ void *word(uintptr_t value) {
     return reinterpret_cast<void *>(value);
 }
 
-// ---- The list alone
+// --- The list alone
 
 struct FdicList : testing::Test {
     fdic *list = nullptr;
-    std::string told; // "3+ " for an interest that is there, "3- " for one that has gone
+    std::string reported; // "3+ " for an interest that is active, "3- " for one that was removed
     static lc_status take(const fdic_event_array *changes, void *data) {
         for (uint32_t i = 0; i < fdic_event_array_length_quick(changes); i++) {
             const fdic_event *event = fdic_event_array_get_quick(changes, i);
-            static_cast<FdicList *>(data)->told += std::to_string(event->id) + (event->active ? "+ " : "- ");
+            static_cast<FdicList *>(data)->reported +=
+                std::to_string(event->id) + (event->active ? "+ " : "- ");
         }
         return LC_OK;
     }
@@ -32,7 +33,7 @@ struct FdicList : testing::Test {
         EXPECT_EQ(fdic_deinit(&list), LC_OK);
         EXPECT_EQ(list, nullptr);
     }
-    int32_t id = -5; // of what was added last
+    int32_t id = -5; // of the interest that was added last
     lc_status add_fd(int fd, int want_read, int want_write) {
         return fdic_event_add_fd(list, fd, want_read, want_write, nullptr, nullptr, nullptr, nullptr, nullptr,
                                  &id);
@@ -42,26 +43,26 @@ struct FdicList : testing::Test {
     }
     void expect(const char *changes, lc_status got, lc_status status = LC_OK) {
         EXPECT_EQ(got, status) << changes;
-        EXPECT_EQ(told, changes);
-        told.clear();
+        EXPECT_EQ(reported, changes);
+        reported.clear();
     }
 };
 
-TEST_F(FdicList, EachChangeIsToldOnce) {
+TEST_F(FdicList, EachChangeIsReportedOnce) {
     gcl_log log;
     expect("1+ ", add_fd(10, 1, 0));
     EXPECT_EQ(id, 1);
-    expect("", fdic_event_update_fd(list, 1, 1, 0)); // nothing new
+    expect("", fdic_event_update_fd(list, 1, 1, 0)); // no change
     expect("1+ ", fdic_event_update_fd(list, 1, 1, 1));
     expect("", add_fd(-1, 1, 1));
-    expect("3+ ", add_fd(11, 0, 0)); // no interest, but a descriptor
+    expect("3+ ", add_fd(11, 0, 0)); // neither reading nor writing, but a descriptor
     expect("1- ", fdic_event_delete_fd(list, 1));
     expect("", fdic_event_delete_fd(list, 1), LC_NOT_FOUND);
     expect("", fdic_event_update_fd(list, 2, 1, 1), LC_NOT_FOUND);
     expect("", fdic_event_delete_fd(list, -1), LC_NOT_FOUND);
     expect("3- ", fdic_event_delete_fd(list, 3));
 
-    expect("", add_timer(-7)); // not armed: no interest
+    expect("", add_timer(-7)); // not watched
     expect("5+ ", add_timer(50));
     expect("", fdic_event_update_timer(list, 5, 50));
     expect("5+ ", fdic_event_update_timer(list, 5, 60));
@@ -74,24 +75,23 @@ TEST_F(FdicList, EachChangeIsToldOnce) {
 }
 
 TEST_F(FdicList, TheQueryIsACopyInOrder) {
-    for (int fd = 20; fd < 60; fd++)
+    for (int fd = 20; fd < 24; fd++)
         EXPECT_EQ(add_fd(fd, fd % 2, 1), LC_OK);
-    EXPECT_EQ(fdic_event_delete_fd(list, 7), LC_OK);
+    EXPECT_EQ(fdic_event_delete_fd(list, 2), LC_OK);
     fdic_event_array *events = nullptr;
     ASSERT_EQ(fdic_events_query(list, &events), LC_OK);
-    ASSERT_EQ(fdic_event_array_length_quick(events), 39u);
-    for (uint32_t i = 0; i < 39; i++) {
+    ASSERT_EQ(fdic_event_array_length_quick(events), 3u);
+    for (uint32_t i = 0; i < 3; i++) {
         fdic_event *event = fdic_event_array_get_quick(events, i);
-        EXPECT_EQ(event->id, i < 6 ? i + 1 : i + 2);
-        EXPECT_EQ(event->fd, static_cast<int>(event->id) + 19);
+        EXPECT_TRUE(event->id == (i ? i + 2 : 1) && event->fd == static_cast<int>(event->id) + 19);
         event->fd = 1000;
     }
     EXPECT_EQ(fdic_event_array_free(&events), LC_OK);
-    told.clear();
-    expect("2+ ", fdic_event_update_fd(list, 2, 0, 1));
+    reported.clear();
+    expect("3+ ", fdic_event_update_fd(list, 3, 1, 1));
 }
 
-// ---- With the bridge
+// --- With the bridge
 
 struct FdicBridge : testing::Test {
     lew *wrapper = nullptr;
@@ -110,8 +110,7 @@ struct FdicBridge : testing::Test {
     }
     void SetUp() override {
         loop_context *loop = nullptr;
-        ASSERT_EQ(lew_init(&wrapper), LC_OK);
-        ASSERT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
+        ASSERT_TRUE(lew_init(&wrapper) == LC_OK && lew_get_event_context(wrapper, &loop) == LC_OK);
         ASSERT_EQ(fdic_libevent_init(loop, &bridge), LC_OK);
         ASSERT_EQ(fdic_init(&list, fdic_libevent_callback, bridge), LC_OK);
         ASSERT_EQ(fdic_libevent_set_fd_close_handler(bridge, called, word(55)), LC_OK);
@@ -161,12 +160,12 @@ TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
     gcl_log log;
     const int32_t id = add(1, 1);
     ASSERT_EQ(write(ends[1], "x", 1), 1);
-    for (const lc_status status : {LC_BAD_TYPE, LC_CANCELLED}) { // a failure ends it for this firing
+    for (const lc_status status : {LC_BAD_TYPE, LC_CANCELLED}) { // a failure ends this round of calls
         on_call = [status](uint32_t) { return status; };
         EXPECT_EQ(round(), (list_of{"1:1"}));
         EXPECT_EQ(log.count("Error code"), 1);
     }
-    on_call = [&](uint32_t kind) { // a deleted one is still told that it may write
+    on_call = [&](uint32_t kind) { // the write function is still called after the interest is deleted
         return kind == FDIC_READABLE ? fdic_event_delete_fd(list, id) : LC_OK;
     };
     EXPECT_EQ(round(), (list_of{"1:1", "5:55", "2:2"}));
@@ -178,12 +177,12 @@ TEST_F(FdicBridge, TimersFireOnce) {
     EXPECT_TRUE(calls.empty());
     EXPECT_EQ(round(), (list_of{"3:3"}));
     int none = 0;
-    EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay arms nothing
+    EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay does not start it again
     EXPECT_EQ(lew_dispatch_once(wrapper, &none, nullptr), LC_OK);
     EXPECT_EQ(none, 1);
     EXPECT_EQ(fdic_event_update_timer(list, id, 6), LC_OK);
     EXPECT_EQ(round(), (list_of{"3:3"}));
-    // A delay beyond all time waits, and doesn't wrap.
+    // The largest delay does not overflow.
     EXPECT_EQ(fdic_event_update_timer(list, id, INT64_MAX), LC_OK);
     int32_t soon = 0;
     ASSERT_EQ(fdic_event_add_timer(list, 1, this, called, word(9), &soon), LC_OK);
@@ -191,9 +190,9 @@ TEST_F(FdicBridge, TimersFireOnce) {
     EXPECT_EQ(fdic_event_delete_timer(list, id), LC_OK);
 }
 
-// A change by another thread waits for the loop; until then, and for good when the loop has ended, nothing of
-// the bridge moves and no handler runs.
-TEST_F(FdicBridge, ChangesOfAnotherThreadAreTheLoopsToMake) {
+// A change that another thread makes is applied by the loop. Until then, or for ever if the loop has ended,
+// the bridge does not change and no handler is called.
+TEST_F(FdicBridge, ChangesOfAnotherThreadAreAppliedByTheLoop) {
     const int32_t id = add(1, 0);
     calls.clear();
     ASSERT_EQ(write(ends[1], "x", 1), 1);
@@ -212,7 +211,7 @@ TEST_F(FdicBridge, ChangesOfAnotherThreadAreTheLoopsToMake) {
     EXPECT_EQ(fdic_event_update_fd(list, second, 0, 1), LC_OK); // after the other's change
     EXPECT_EQ(round(), (list_of{"2:2"}));
     std::thread([&] { EXPECT_EQ(fdic_event_delete_fd(list, second), LC_OK); }).join();
-    calls.clear(); // taken down with the change still waiting
+    calls.clear(); // freed while the change is still posted
 }
 
 } // namespace

@@ -1,4 +1,4 @@
-// The form of a line, what decides whether it is written, and the files that the log follows.
+// The format of a line, the levels that decide whether it is written, and the files that the log checks.
 #include "runtime/logging.h"
 
 #include <gtest/gtest.h>
@@ -61,8 +61,8 @@ struct Log : testing::Test {
     }
 };
 
-// Comes first: nothing of this process has logged yet.
-TEST_F(Log, AFirstLineSetsTheLogUp) {
+// The first test: nothing in this process has logged yet.
+TEST_F(Log, TheFirstLineSetsUpTheLog) {
     ASSERT_EQ(G_log_state_lock, nullptr);
     LC_LOG(LC_LOG_NOTICE, "early");
     const std::string line = daemon.one();
@@ -77,7 +77,7 @@ TEST_F(Log, ALineHasTheBytesOfVsyslog) {
         const std::string text(length, 'x');
         std::string theirs, ours;
         for (int attempt = 0; attempt < 3 && (ours.empty() || ours != theirs);
-             attempt++) { // a second may end
+             attempt++) { // the second may change in between
             (void)lc_log_internal(nullptr, nullptr, 0, LC_LOG_FLAG_NO_THREAD, 0, LC_LOG_WARNING, "%s",
                                   text.c_str());
             ours = daemon.one();
@@ -114,7 +114,7 @@ TEST_F(Log, WhatDoesNotFitIsCut) {
     ASSERT_EQ(init(), LC_OK);
     QV_LOG(LC_LOG_ERR, "%s", std::string(2000, 'y').c_str());
     EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: " + std::string(1023, 'y') + "\n");
-    // A format that is cut at each place around its conversion.
+    // Cuts the format at each position around its conversion.
     for (int length = 960; length < 1020; length++) {
         const std::string format =
             std::string(static_cast<size_t>(length), 'z') + "%08ld" + std::string(99, 'z');
@@ -148,7 +148,7 @@ TEST_F(Log, LevelsAndTheirOrder) {
     G_logging_suspended = 0;
     EXPECT_EQ(daemon.take().size(), 0u);
 
-    // A line above the initial maximum passes only for a level of the process's own.
+    // A line above the initial maximum is written only if the process has a level of its own.
     ASSERT_EQ(lc_log_init("wccpd", nullptr, 0, 0x1060000, LC_LOG_ERR, 136, 1), LC_OK);
     QV_LOG(LC_LOG_NOTICE, "dropped");
     EXPECT_EQ(lc_log_set_daemon_log_level(5), LC_OK);
@@ -156,7 +156,7 @@ TEST_F(Log, LevelsAndTheirOrder) {
     EXPECT_EQ(body(daemon.one()), "[wccpd.NOTICE]: kept\n");
 }
 
-TEST_F(Log, TheOverrideCountsWhileBothSwitchesAreOn) {
+TEST_F(Log, TheOverrideAppliesWhileBothSwitchesAreOn) {
     const auto leaves = [](lc_status status, int32_t level) {
         return status == LC_OK && G_log_level == level;
     };
@@ -164,15 +164,16 @@ TEST_F(Log, TheOverrideCountsWhileBothSwitchesAreOn) {
     EXPECT_TRUE(leaves(lc_log_set_override_log_level("debug"), 5));
     EXPECT_TRUE(leaves(lc_log_enable_override_log_level(1, 1), 5));
     EXPECT_TRUE(leaves(lc_log_enable_override_log_level(0, 1), 7));
-    EXPECT_TRUE(leaves(lc_log_set_max_log_level("err"), 7)); // kept for later
+    EXPECT_TRUE(leaves(lc_log_set_max_log_level("err"), 7)); // applies after the override
     EXPECT_TRUE(leaves(lc_log_set_override_log_level("info"), 6));
-    EXPECT_TRUE(leaves(lc_log_set_override_log_level("nonsense"), 3)); // ends it
+    EXPECT_TRUE(leaves(lc_log_set_override_log_level("nonsense"), 3)); // ends the override
     EXPECT_TRUE(leaves(lc_log_enable_override_log_level(0, 1), 3));
     EXPECT_TRUE(leaves(lc_log_set_override_log_level("debug"), 7));
     EXPECT_TRUE(leaves(lc_log_set_daemon_log_level(1), 7));
     EXPECT_TRUE(leaves(lc_log_enable_override_log_level(1, 0), 3));
-    EXPECT_EQ(level_of_mask(), 1);                                  // the process's own level keeps it
-    EXPECT_TRUE(leaves(lc_log_enable_override_log_level(0, 0), 3)); // takes the current level as the override
+    EXPECT_EQ(level_of_mask(), 1); // that of the process
+    EXPECT_TRUE(
+        leaves(lc_log_enable_override_log_level(0, 0), 3)); // the current level becomes the override level
     EXPECT_TRUE(leaves(lc_log_enable_override_log_level(0, 1), 3));
     EXPECT_TRUE(leaves(lc_log_enable_override_log_level(1, 1), 3));
 }
@@ -188,7 +189,7 @@ TEST_F(Log, TheLevelLink) {
     }
 }
 
-TEST_F(Log, WhoHasNoManagementFollowsTheFiles) {
+TEST_F(Log, UnmanagedProcessesFollowTheFiles) {
     for (const bool polls : {true, false}) {
         set_link("4");
         write_file(ZONE, "one");
@@ -198,7 +199,7 @@ TEST_F(Log, WhoHasNoManagementFollowsTheFiles) {
         set_link("6");
         const timespec later[2] = {{1000000000, 0}, {1000000000, 0}};
         ASSERT_EQ(utimensat(AT_FDCWD, ZONE, later, 0), 0);
-        usleep(1100000); // it looks once a second
+        usleep(1100000); // the files are checked once a second
         LC_LOG(LC_LOG_ERR, "two");
         EXPECT_EQ(G_log_level, polls ? 6 : 4);
         EXPECT_EQ(getenv("TZ") == nullptr, polls);
@@ -207,7 +208,7 @@ TEST_F(Log, WhoHasNoManagementFollowsTheFiles) {
     unlink(ZONE);
 }
 
-TEST_F(Log, AConsoleGetsAHeadAndKeepsItsLevel) {
+TEST_F(Log, AConsoleGetsAHeaderAndKeepsItsLevel) {
     ASSERT_EQ(init("tool", 0, nullptr, LOG_TO_STDERR), LC_OK);
     EXPECT_EQ(lc_log_set_max_log_level("emerg"), LC_OK);
     testing::internal::CaptureStderr();
@@ -224,7 +225,7 @@ TEST_F(Log, AfterTheCloseLinesAreDropped) {
     EXPECT_EQ(lc_log_close(), LC_OK);
     EXPECT_EQ(lc_log_close(), LC_NULL);
     EXPECT_EQ(lc_log_internal(nullptr, nullptr, 0, 0, 0, LC_LOG_ERR, "x"), LC_GENERIC);
-    EXPECT_EQ(lc_log_set_max_log_level("err"), LC_NULL); // its own failure finds no log, and no deadlock
+    EXPECT_EQ(lc_log_set_max_log_level("err"), LC_NULL); // its failure is not logged, and does not deadlock
     EXPECT_EQ(daemon.take().size(), 0u);
 }
 

@@ -1,5 +1,5 @@
-// Shared blocks and display buffers. Each case of shared blocks runs in a child with keys of its own, since a
-// process keeps its registry.
+// Shared memory blocks and display buffers. Each case of shared memory runs in a child process with an IPC
+// namespace of its own, since a process attaches the registry once.
 #include "runtime/cmem.h"
 
 #include <gtest/gtest.h>
@@ -26,7 +26,7 @@ constexpr uint64_t BLOCK_BYTES = 10000; // 12288 in pages
 constexpr key_t BLOCK_KEY = 0x12345;
 constexpr size_t REGISTRY_BYTES = 361608;
 
-// The C library's, in its place: nothing waits here, and another process may do something meanwhile.
+// Replaces sleep(): nothing waits here, and a case may change something in the meantime.
 static unsigned slept;
 static std::function<void()> while_asleep;
 extern "C" unsigned sleep(unsigned seconds) {
@@ -40,7 +40,7 @@ static void write_conf(const std::string &text) {
     std::ofstream(CMEM_CONF_PATH) << text;
 }
 
-// The wait status of a child that runs `body`: 0 when nothing was wrong with it.
+// Runs `body` in a child process and returns its wait status: 0 if nothing failed.
 static int in_process(bool own_keys, const std::function<void()> &body) {
     fflush(nullptr);
     const pid_t child = fork();
@@ -57,7 +57,7 @@ static int in_process(bool own_keys, const std::function<void()> &body) {
 }
 #define IN_CHILD(...) ASSERT_EQ(in_process(true, [&]() __VA_ARGS__), 0)
 
-// The bytes of the registry, which is created empty when there is none.
+// The bytes of the registry, which is created empty if it does not exist.
 static uint8_t *registry_bytes() {
     return static_cast<uint8_t *>(
         shmat(shmget(CMEM_REGISTRY_KEY, REGISTRY_BYTES, IPC_CREAT | 0777), nullptr, 0));
@@ -82,8 +82,8 @@ struct Blocks : testing::Test {
         write_conf("# the blocks\n\nblock local normal 12345\nother\tinter\tnormal\t0x12346\n");
     }
     void TearDown() override { (void)lc_log_close(); }
-    // Exactly one line came and it has this text.
-    testing::AssertionResult told(const std::string &text) {
+    // Exactly one line was logged, and contains this text.
+    testing::AssertionResult logged(const std::string &text) {
         const std::string line = daemon.one();
         return line.find(text) != std::string::npos ? testing::AssertionSuccess()
                                                     : testing::AssertionFailure() << line;
@@ -104,10 +104,10 @@ TEST_F(Blocks, ANewBlockIsFoundByOthersAndInTheRegistry) {
         EXPECT_TRUE(again && length == 12288 && again[12287] == 5);
         EXPECT_EQ(create(BLOCK_BYTES, "block"), nullptr);
         const std::string pid = std::to_string(getpid());
-        EXPECT_TRUE(told("cmem_create_block: double create attempt for memory block block, old pid=" + pid +
-                         ", new pid=" + pid + "\n"));
+        EXPECT_TRUE(logged("cmem_create_block: double create attempt for memory block block, old pid=" + pid +
+                           ", new pid=" + pid + "\n"));
         EXPECT_EQ(cmem_attach_block("nobody"), nullptr);
-        EXPECT_TRUE(told("cmem_attach_block: memory block nobody not found\n"));
+        EXPECT_TRUE(logged("cmem_attach_block: memory block nobody not found\n"));
 
         EXPECT_EQ(segment_of(CMEM_REGISTRY_KEY).shm_segsz, REGISTRY_BYTES);
         const uint8_t *bytes = registry_bytes();
@@ -128,18 +128,18 @@ TEST_F(Blocks, ANewBlockIsFoundByOthersAndInTheRegistry) {
     });
 }
 
-TEST_F(Blocks, TheNextProcessTakesOverWhatIsLeft) {
+TEST_F(Blocks, TheNextProcessTakesOverABlock) {
     IN_CHILD({
         EXPECT_EQ(in_process(false, [] { memset(create(BLOCK_BYTES, "block"), 0xff, 12288); }), 0);
         EXPECT_EQ(create(BLOCK_BYTES * 2, "block"), nullptr);
-        EXPECT_TRUE(told("length change attempt for memory block block, old len=12288, new len=20480\n"));
+        EXPECT_TRUE(logged("length change attempt for memory block block, old len=12288, new len=20480\n"));
         const int id = shmget(BLOCK_KEY, 0, 0);
         const uint8_t *block = create(BLOCK_BYTES + 1, "block");
         ASSERT_NE(block, nullptr);
         EXPECT_EQ(shmget(BLOCK_KEY, 0, 0), id);
         EXPECT_EQ(std::count(block, block + 12288, 0), 12288);
     });
-    IN_CHILD({ // from one that nobody has waited for, and from an earlier one with our process id
+    IN_CHILD({ // from a zombie, and from an earlier process with our process id
         const pid_t gone = fork();
         if (gone == 0)
             _exit(create(BLOCK_BYTES, "block") && create(1, "other") ? 0 : 1);
@@ -154,12 +154,13 @@ TEST_F(Blocks, TheNextProcessTakesOverWhatIsLeft) {
     });
 }
 
-// Two processes create one block at the same moment, in turn a new one and one whose creator has gone.
+// Two processes create the same block at the same moment, alternately a new one and one whose creator has
+// ended.
 TEST_F(Blocks, OfTwoProcessesExactlyOneCreatesABlock) {
     constexpr int ROUNDS = 300;
     IN_CHILD({
         ASSERT_TRUE(cmem_attach_registry());
-        (void)lc_log_set_daemon_log_level(0); // the refused one complains each time
+        (void)lc_log_set_daemon_log_level(0); // a refusal is logged each time
         struct meeting {
             std::atomic<int> ready, done, created;
         };
@@ -196,9 +197,9 @@ TEST_F(Blocks, ARegistryThatIsNotReady) {
         registry_state() = LOADING;
         EXPECT_EQ(create(BLOCK_BYTES, "block"), nullptr);
         EXPECT_EQ(slept, 5u);
-        EXPECT_TRUE(told("cmem_attach_registry: the block registry has been loading for 5 seconds"));
-        EXPECT_EQ(segment_of(CMEM_REGISTRY_KEY).shm_nattch, 1u); // this test's
-        // It gets there in time, or gives up.
+        EXPECT_TRUE(logged("cmem_attach_registry: the block registry has been loading for 5 seconds"));
+        EXPECT_EQ(segment_of(CMEM_REGISTRY_KEY).shm_nattch, 1u); // the test's own
+        // It finishes in time, or sets the registry back to empty.
         registry_state() = LOADING;
         while_asleep = [] { registry_state() = EMPTY; };
         EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
@@ -209,15 +210,15 @@ TEST_F(Blocks, ARegistryThatIsNotReady) {
         (void)cmem_attach_registry();
     });
     EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
-    EXPECT_TRUE(told("cmem_attach_registry: Cannot attach to shmem, err=Invalid argument\n"));
-    IN_CHILD({ // a file that cannot be read now can be for the next process
+    EXPECT_TRUE(logged("cmem_attach_registry: Cannot attach to shmem, err=Invalid argument\n"));
+    IN_CHILD({ // the next process tries to read the file again
         std::filesystem::remove(CMEM_CONF_PATH);
         EXPECT_EQ(in_process(false, [] { EXPECT_TRUE(cmem_attach_registry()); }), 0);
         EXPECT_TRUE(
-            told("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=No such file or directory\n"));
+            logged("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=No such file or directory\n"));
         std::filesystem::create_directory(CMEM_CONF_PATH);
         EXPECT_EQ(in_process(false, [] { EXPECT_TRUE(cmem_attach_registry()); }), 0);
-        EXPECT_TRUE(told("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=Is a directory\n"));
+        EXPECT_TRUE(logged("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=Is a directory\n"));
         std::filesystem::remove(CMEM_CONF_PATH);
         write_conf("block local normal 12345\n");
         EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
@@ -229,19 +230,19 @@ TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
         ASSERT_GE(shmget(BLOCK_KEY, 4096, IPC_CREAT | 0777), 0);
         EXPECT_EQ(create(BLOCK_BYTES, "block"), nullptr);
         EXPECT_TRUE(
-            told("cmem_create_block: cannot attach/shmget shared block block, length=12288, key=12345, "
-                 "pagesize=4096, shmid=-1, err=Invalid argument, errno=22, check SHMMAX\n"));
-        EXPECT_EQ(cmem_exists_block("block"), 0); // its record is free again
+            logged("cmem_create_block: cannot attach/shmget shared block block, length=12288, key=12345, "
+                   "pagesize=4096, shmid=-1, err=Invalid argument, errno=22, check SHMMAX\n"));
+        EXPECT_EQ(cmem_exists_block("block"), 0); // its record has been freed
         EXPECT_EQ(create(UINT64_MAX, "block"), nullptr);
-        EXPECT_TRUE(told("cannot attach/shmget shared block block"));
+        EXPECT_TRUE(logged("cannot attach/shmget shared block block"));
         // The segment of a block in the registry has been replaced by a shorter one.
         ASSERT_NE(create(BLOCK_BYTES, "other"), nullptr);
         ASSERT_EQ(shmctl(shmget(0x12346, 0, 0), IPC_RMID, nullptr), 0);
         EXPECT_EQ(cmem_exists_block("other"), 0);
-        EXPECT_TRUE(told("cannot shmget to shared block other, err=No such file or directory\n"));
+        EXPECT_TRUE(logged("cannot shmget to shared block other, err=No such file or directory\n"));
         ASSERT_GE(shmget(0x12346, 4096, IPC_CREAT | 0777), 0);
         EXPECT_EQ(cmem_attach_block("other"), nullptr);
-        EXPECT_TRUE(told("cannot shmget shared block other, key=74566, err=Invalid argument\n"));
+        EXPECT_TRUE(logged("cannot shmget shared block other, key=74566, err=Invalid argument\n"));
     });
     for (const size_t bytes : {size_t{8193}, size_t{BLOCK_BYTES}}) // enough in whole pages
         IN_CHILD({
@@ -256,7 +257,7 @@ TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
             (void)cmem_attach_block("block");
         });
         EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
-        EXPECT_TRUE(told(": Cannot attach to shmem, err=Invalid argument\n"));
+        EXPECT_TRUE(logged(": Cannot attach to shmem, err=Invalid argument\n"));
     }
 }
 
@@ -282,18 +283,18 @@ TEST_F(Blocks, LinesOfTheConfiguration) {
             EXPECT_NE(lines[i].find(wanted[i]), std::string::npos) << lines[i];
         for (const std::string name : {"bad", "worse", "registry", "nokey", "big", "words", "unlisted"}) {
             EXPECT_EQ(create(1, name.c_str()), nullptr);
-            EXPECT_TRUE(told("attempt to create shared block " + name + " conflicts with conf file\n"));
+            EXPECT_TRUE(logged("attempt to create shared block " + name + " conflicts with conf file\n"));
         }
         EXPECT_EQ(cmem_create_block(1, "at"), reinterpret_cast<void *>(0x300000000000));
         EXPECT_NE(create(1, "many800"), nullptr);
-        EXPECT_EQ(create(1, "many999"), nullptr); // beyond the table
+        EXPECT_EQ(create(1, "many999"), nullptr); // more than the table has room for
     });
 }
 
 // --- Display buffers
 
 TEST(DisplayBuffer, HoldsWhatFits) {
-    for (const uint32_t offset : {0u, 1u, 3u}) { // on any address
+    for (const uint32_t offset : {0u, 1u, 3u}) { // at any address
         const std::unique_ptr<char[]> memory(new char[1024 + offset]);
         csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.get() + offset, 1024);
         ASSERT_NE(buffer, nullptr);
@@ -307,7 +308,7 @@ TEST(DisplayBuffer, HoldsWhatFits) {
         EXPECT_EQ(csys_display_buf_bytes_used(buffer), 991u);
         buffer = csys_create_safe_display_buf_desc(memory.get() + offset, 1024);
         EXPECT_EQ(csys_append_to_safe_display_buf(buffer, std::string(991, 'x').c_str()), 991u);
-        EXPECT_EQ(csys_display_buf_text(buffer), std::string(991, 'x')); // full, not cut
+        EXPECT_EQ(csys_display_buf_text(buffer), std::string(991, 'x')); // full, but not cut
         memory[1024 + offset - 32] ^= 1;
         EXPECT_EQ(csys_chk_display_buf(buffer), 1);
         EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "y"), 0u);

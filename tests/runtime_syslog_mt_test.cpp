@@ -1,5 +1,5 @@
-// The log and its daemon: one that reads, one that is stopped, one that ends and comes back, none at all;
-// threads that are cancelled while they log, and a process that forks then.
+// The log with a syslog daemon that reads, is stopped, ends and is started again, or does not exist; threads
+// that are cancelled while they log, and a process that forks meanwhile.
 #include "runtime/logging.h"
 
 #include <gtest/gtest.h>
@@ -30,9 +30,9 @@ static void expect_lines(const std::vector<std::string> &lines, size_t begin, in
     for (int i = from; i < to; i++)
         ASSERT_EQ(number_in(lines[begin + static_cast<size_t>(i - from)], "line "), i);
 }
-// More than a socket's queue and send buffer hold.
+// More than the queue and the send buffer of a socket hold.
 constexpr int FLOOD = 1000;
-// What a stopped daemon may cost in all. The patience is 30 ms; the rest is for a busy machine.
+// The delay that a stopped daemon may cause in all. The patience is 30 ms; the rest is for a busy machine.
 constexpr int64_t COST_MS = 500;
 
 struct Syslog : testing::TestWithParam<int> {
@@ -41,7 +41,7 @@ struct Syslog : testing::TestWithParam<int> {
         daemon = std::make_unique<log_daemon>(GetParam());
         ASSERT_EQ(lc_log_init("wccpd", nullptr, 0, 0x1060000, 7, 136, 1), LC_OK);
         ASSERT_EQ(lc_log_set_daemon_log_level(7), LC_OK);
-        log_numbered(-1, 0); // takes along what is still to be reported of an earlier case
+        log_numbered(-1, 0); // reports the lost lines of an earlier case
         (void)daemon->take();
     }
     void TearDown() override { (void)lc_log_close(); }
@@ -49,13 +49,13 @@ struct Syslog : testing::TestWithParam<int> {
 INSTANTIATE_TEST_SUITE_P(Sockets, Syslog, testing::Values(SOCK_DGRAM, SOCK_STREAM),
                          [](const auto &kind) { return kind.param == SOCK_DGRAM ? "datagram" : "stream"; });
 
-// Logs 500 lines while another thread reads, with a rest after each line. On a machine that is busy with
-// other things the reader may stand still as well: there are three tries.
+// Logs 500 lines while another thread reads, with a pause after each line. On a busy machine the reader may
+// be held up as well, so there are three attempts.
 static void expect_burst(log_daemon *daemon, useconds_t rest_us) {
     std::vector<std::string> lines;
     for (int attempt = 0; attempt < 3 && lines.size() != 500; attempt++) {
         (void)daemon->take();
-        log_numbered(-1, 0); // takes along what is still to be reported of the last try
+        log_numbered(-1, 0); // reports the lost lines of the last attempt
         (void)daemon->take();
         lines.clear();
         std::thread reader([&] {
@@ -63,7 +63,7 @@ static void expect_burst(log_daemon *daemon, useconds_t rest_us) {
                 const std::vector<std::string> more = daemon->take(500, 1);
                 if (more.empty())
                     return;
-                lines.insert(lines.end(), more.begin(), more.end()); // a stream gives several at once
+                lines.insert(lines.end(), more.begin(), more.end()); // a stream returns several at once
                 usleep(lines.size() % 100 ? rest_us : rest_us * 50);
             }
         });
@@ -78,9 +78,9 @@ TEST_P(Syslog, ABurstArrivesWholeAndInOrder) {
         expect_burst(daemon.get(), rest_us);
 }
 
-TEST_P(Syslog, AStoppedReaderCostsMillisecondsAndIsTold) {
+TEST_P(Syslog, AStoppedReaderCostsMillisecondsAndIsReported) {
     const int64_t began = lt_monotonic_ms();
-    errno = EAGAIN; // as a drained socket of the caller's leaves it
+    errno = EAGAIN; // as after a read from an empty socket
     log_numbered(0, FLOOD);
     EXPECT_LT(lt_monotonic_ms() - began, COST_MS);
     std::vector<std::string> lines = daemon->take();
@@ -95,7 +95,7 @@ TEST_P(Syslog, AStoppedReaderCostsMillisecondsAndIsTold) {
     EXPECT_TRUE(lines[0].starts_with("<139>") && lines[0].ends_with(')')); // no newline
     EXPECT_EQ(lines[0].find("TID"), std::string::npos);
     expect_lines(lines, 1, FLOOD, FLOOD + 1);
-    expect_burst(daemon.get(), 0); // told once; the patience is there again
+    expect_burst(daemon.get(), 0); // reported once; the patience has been restored
 }
 
 TEST_P(Syslog, ThreadsShareOnePatience) {
@@ -115,10 +115,10 @@ TEST_P(Syslog, ThreadsShareOnePatience) {
     EXPECT_EQ(sum, FLOOD);
 }
 
-TEST_P(Syslog, ADaemonThatGoesAndComesBackIsFound) {
+TEST_P(Syslog, ADaemonThatIsRestartedIsFound) {
     daemon->stop();
     const int64_t began = lt_monotonic_ms();
-    log_numbered(0, 5000); // lost, without a word and cheaply
+    log_numbered(0, 5000); // lost silently and cheaply
     EXPECT_LT(lt_monotonic_ms() - began, 2000);
     daemon->start();
     log_numbered(6, 9);
@@ -129,7 +129,7 @@ TEST_P(Syslog, ADaemonThatGoesAndComesBackIsFound) {
     expect_lines(daemon->take(), 0, 9, 12);
 
     log_numbered(0, FLOOD);
-    log_daemon successor; // the old one still holds its socket, and is stopped
+    log_daemon successor; // the old one is stopped and still has its socket
     log_numbered(0, 3);
     const std::vector<std::string> lines = successor.take();
     ASSERT_EQ(lines.size(), 4u);
@@ -137,7 +137,7 @@ TEST_P(Syslog, ADaemonThatGoesAndComesBackIsFound) {
     expect_lines(lines, 1, 0, 3);
 }
 
-// The queue of datagrams holds a few lines; the threads wait for room and are not ended there.
+// The queue of datagrams holds a few lines; a thread that waits for room is not cancelled there.
 TEST_P(Syslog, ACancelledThreadFinishesItsLines) {
     std::atomic<int> finished{0};
     for (int round = 0; round < 50; round++) {
