@@ -72,10 +72,10 @@ struct loop_event {
     event_kind kind;
     bool inserted;
     int number; // descriptor or signal
-    short found;
-    loop_event *next_found;
-    short noted;
-    loop_event *next_noted, *previous_noted;
+    short ready_flags;
+    loop_event *next_ready;
+    short queued_flags;
+    loop_event *next_queued, *previous_queued;
     loop_event *next_signal;
 };
 
@@ -99,8 +99,8 @@ struct loop_context {
     event *pipe_event, *limit_event;
     bool pipe_readable;
     uint32_t inserted, descriptors, timers;
-    loop_event *found_first, *found_last;
-    loop_event *noted_first, *noted_last;
+    loop_event *ready_first, *ready_last;
+    loop_event *queue_first, *queue_last;
     loop_event *signals;
     sigset_t owned_signals;
     pthread_mutex_t posts_mutex;
@@ -109,7 +109,9 @@ struct loop_context {
 
 // ---- The lock
 
-static void lock_take(loop_lock *lock, uint32_t count) {
+namespace {
+
+void take_loop_lock(loop_lock *lock, uint32_t count) {
     const mutex_guard guard(&lock->mutex);
     const pthread_t self = pthread_self();
     while (lock->count && !pthread_equal(lock->holder, self))
@@ -117,17 +119,20 @@ static void lock_take(loop_lock *lock, uint32_t count) {
     lock->holder = self;
     lock->count += count;
 }
-static void lock_give(loop_lock *lock, uint32_t count) {
+void give_loop_lock(loop_lock *lock, uint32_t count) {
     const mutex_guard guard(&lock->mutex);
     lock->count -= count;
     if (!lock->count)
         pthread_cond_signal(&lock->freed);
 }
+
+} // namespace
+
 void loop_lock_take(loop_context *context) {
-    lock_take(&context->lock, 1);
+    take_loop_lock(&context->lock, 1);
 }
 void loop_lock_give(loop_context *context) {
-    lock_give(&context->lock, 1);
+    give_loop_lock(&context->lock, 1);
 }
 
 int loop_is_own_thread(const loop_context *context) {
@@ -136,59 +141,62 @@ int loop_is_own_thread(const loop_context *context) {
 
 // ---- The queue
 
-static void note(loop_event *event, short flags) {
+namespace {
+
+void queue_event(loop_event *event, short flags) {
     loop_context *context = event->context;
-    const bool queued = event->noted != 0;
-    event->noted = static_cast<short>(event->noted | flags);
+    const bool queued = event->queued_flags != 0;
+    event->queued_flags = static_cast<short>(event->queued_flags | flags);
     if (queued)
         return;
-    event->next_noted = nullptr;
-    event->previous_noted = context->noted_last;
-    (context->noted_last ? context->noted_last->next_noted : context->noted_first) = event;
-    context->noted_last = event;
+    event->next_queued = nullptr;
+    event->previous_queued = context->queue_last;
+    (context->queue_last ? context->queue_last->next_queued : context->queue_first) = event;
+    context->queue_last = event;
 }
 
-static short take_note(loop_event *event) {
+short unqueue_event(loop_event *event) {
     loop_context *context = event->context;
-    const short flags = event->noted;
+    const short flags = event->queued_flags;
     if (!flags)
         return 0;
-    event->noted = 0;
-    (event->previous_noted ? event->previous_noted->next_noted : context->noted_first) = event->next_noted;
-    (event->next_noted ? event->next_noted->previous_noted : context->noted_last) = event->previous_noted;
+    event->queued_flags = 0;
+    (event->previous_queued ? event->previous_queued->next_queued : context->queue_first) =
+        event->next_queued;
+    (event->next_queued ? event->next_queued->previous_queued : context->queue_last) = event->previous_queued;
     return flags;
 }
 
 // What libevent calls: inside the wait, without the lock, on the owner's thread.
-static void found(evutil_socket_t, short flags, void *data) {
+void handle_ready_event(evutil_socket_t, short flags, void *data) {
     loop_event *event = static_cast<loop_event *>(data);
     loop_context *context = event->context;
-    const bool listed = event->found != 0;
-    event->found = static_cast<short>(event->found | (flags & (EV_TIMEOUT | EV_READ | EV_WRITE)));
-    if (listed || !event->found)
+    const bool listed = event->ready_flags != 0;
+    event->ready_flags = static_cast<short>(event->ready_flags | (flags & (EV_TIMEOUT | EV_READ | EV_WRITE)));
+    if (listed || !event->ready_flags)
         return;
-    event->next_found = nullptr;
-    (context->found_last ? context->found_last->next_found : context->found_first) = event;
-    context->found_last = event;
+    event->next_ready = nullptr;
+    (context->ready_last ? context->ready_last->next_ready : context->ready_first) = event;
+    context->ready_last = event;
 }
-static void pipe_found(evutil_socket_t, short, void *data) {
+void handle_ready_pipe(evutil_socket_t, short, void *data) {
     static_cast<loop_context *>(data)->pipe_readable = true;
 }
-static void limit_found(evutil_socket_t, short, void *) {}
+void handle_wait_limit(evutil_socket_t, short, void *) {}
 
-static void note_found(loop_context *context) {
-    while (loop_event *event = context->found_first) {
-        context->found_first = event->next_found;
-        const short flags = event->found;
-        event->found = 0;
-        note(event, flags);
+void queue_ready_events(loop_context *context) {
+    while (loop_event *event = context->ready_first) {
+        context->ready_first = event->next_ready;
+        const short flags = event->ready_flags;
+        event->ready_flags = 0;
+        queue_event(event, flags);
     }
-    context->found_last = nullptr;
+    context->ready_last = nullptr;
 }
 
 // ---- Events
 
-static void count_event(loop_event *event, bool in) {
+void count_event(loop_event *event, bool in) {
     loop_context *context = event->context;
     const uint32_t step = in ? 1u : ~0u;
     event->inserted = in;
@@ -198,6 +206,8 @@ static void count_event(loop_event *event, bool in) {
     if (event->kind == event_kind::timer)
         context->timers += step;
 }
+
+} // namespace
 
 lc_status loop_event_new(loop_context *context, loop_function function, void *data, loop_event **out) {
     CHECK_NULL(out);
@@ -212,12 +222,16 @@ lc_status loop_event_new(loop_context *context, loop_function function, void *da
     return LC_OK;
 }
 
-static lc_status insert(loop_event *event, const timeval *delay) {
+namespace {
+
+lc_status insert_event(loop_event *event, const timeval *delay) {
     if (event_add(&event->base_event, delay) != 0)
         FAIL_WITH(LC_GENERIC);
     count_event(event, true);
     return LC_OK;
 }
+
+} // namespace
 
 lc_status loop_event_set_fd(loop_event *event, int fd, short flags) {
     CHECK_NULL(event);
@@ -227,13 +241,13 @@ lc_status loop_event_set_fd(loop_event *event, int fd, short flags) {
     event->kind = event_kind::descriptor;
     event->number = fd;
     if (event_assign(&event->base_event, event->context->base, fd, static_cast<short>(flags | EV_PERSIST),
-                     found, event) != 0)
+                     handle_ready_event, event) != 0)
         FAIL_WITH(LC_GENERIC);
     if (!flags) { // registered, and waits for nothing
         count_event(event, true);
         return LC_OK;
     }
-    CHECK_STATUS(insert(event, nullptr));
+    CHECK_STATUS(insert_event(event, nullptr));
     return LC_OK;
 }
 
@@ -244,23 +258,25 @@ lc_status loop_event_set_timer(loop_event *event, int64_t delay_ms) {
     loop_event_remove(event);
     event->kind = event_kind::timer;
     event->number = -1;
-    if (event_assign(&event->base_event, event->context->base, -1, 0, found, event) != 0)
+    if (event_assign(&event->base_event, event->context->base, -1, 0, handle_ready_event, event) != 0)
         FAIL_WITH(LC_GENERIC);
     timeval delay;
     delay.tv_sec = delay_ms / 1000;
     delay.tv_usec = delay_ms % 1000 * 1000;
     delay.tv_sec = std::min(delay.tv_sec, TIME_MAX_SECONDS - lt_monotonic_ms() / 1000 - 1);
-    CHECK_STATUS(insert(event, &delay));
+    CHECK_STATUS(insert_event(event, &delay));
     return LC_OK;
 }
 
 // ---- Signals
 
 std::atomic<loop_context *> le_signal_contexts[LEW_SIGNAL_MAX + 1];
-static struct sigaction earlier_actions[LEW_SIGNAL_MAX + 1];
-static pthread_mutex_t signal_table_mutex = PTHREAD_MUTEX_INITIALIZER;
+namespace {
 
-static void handle_signal(int number, siginfo_t *, void *) {
+struct sigaction earlier_actions[LEW_SIGNAL_MAX + 1];
+pthread_mutex_t signal_table_mutex = PTHREAD_MUTEX_INITIALIZER;
+
+void write_signal_message(int number, siginfo_t *, void *) {
     const int saved = errno;
     const loop_context *context = le_signal_contexts[number].load();
     if (context) {
@@ -272,7 +288,7 @@ static void handle_signal(int number, siginfo_t *, void *) {
     errno = saved;
 }
 
-static lc_status own_signal(loop_context *context, int number) {
+lc_status take_signal(loop_context *context, int number) {
     const mutex_guard guard(&signal_table_mutex);
     const loop_context *owner = le_signal_contexts[number].load();
     if (owner == context)
@@ -283,7 +299,7 @@ static lc_status own_signal(loop_context *context, int number) {
     }
     struct sigaction action;
     memset(&action, 0, sizeof action);
-    action.sa_sigaction = handle_signal;
+    action.sa_sigaction = write_signal_message;
     action.sa_flags = SA_RESTART | SA_SIGINFO;
     sigfillset(&action.sa_mask);
     sigset_t set;
@@ -299,12 +315,14 @@ static lc_status own_signal(loop_context *context, int number) {
     return LC_OK;
 }
 
-static void disown_signal(loop_context *context, int number) {
+void release_signal(loop_context *context, int number) {
     const mutex_guard guard(&signal_table_mutex);
     sigaction(number, &earlier_actions[number], nullptr);
     le_signal_contexts[number] = nullptr;
     sigdelset(&context->owned_signals, number);
 }
+
+} // namespace
 
 lc_status loop_event_set_signal(loop_event *event, int number) {
     CHECK_NULL(event);
@@ -312,7 +330,7 @@ lc_status loop_event_set_signal(loop_event *event, int number) {
     loop_context *context = event->context;
     const loop_guard guard(context);
     loop_event_remove(event);
-    CHECK_STATUS(own_signal(context, number));
+    CHECK_STATUS(take_signal(context, number));
     event->kind = event_kind::signal;
     event->number = number;
     event->next_signal = context->signals;
@@ -321,7 +339,9 @@ lc_status loop_event_set_signal(loop_event *event, int number) {
     return LC_OK;
 }
 
-static void remove_signal(loop_event *event) {
+namespace {
+
+void remove_signal_event(loop_event *event) {
     loop_context *context = event->context;
     bool others = false;
     for (loop_event **link = &context->signals; *link;) {
@@ -334,17 +354,19 @@ static void remove_signal(loop_event *event) {
         link = &each->next_signal;
     }
     if (!others)
-        disown_signal(context, event->number);
+        release_signal(context, event->number);
 }
+
+} // namespace
 
 void loop_event_remove(loop_event *event) {
     const loop_guard guard(event->context);
-    take_note(event);
+    unqueue_event(event);
     if (!event->inserted)
         return;
     count_event(event, false);
     if (event->kind == event_kind::signal)
-        remove_signal(event);
+        remove_signal_event(event);
     else
         event_del(&event->base_event);
 }
@@ -358,19 +380,21 @@ void loop_event_free(loop_event **inout) {
     free(event);
 }
 
+namespace {
+
 // Each message of the self-pipe: a signal, or number 0 for a mere wake-up.
-static void read_pipe(loop_context *context) {
+void read_wake_pipe(loop_context *context) {
     char message[MESSAGE_BYTES];
     while (read(context->pipe_read, message, sizeof message) == static_cast<ssize_t>(sizeof message)) {
         int number = 0;
         memcpy(&number, message, sizeof number);
         for (loop_event *event = context->signals; number && event; event = event->next_signal)
             if (event->number == number)
-                note(event, LOOP_SIGNAL);
+                queue_event(event, LOOP_SIGNAL);
     }
 }
 
-static lc_status wake(loop_context *context) {
+lc_status wake_owner(loop_context *context) {
     const char message[MESSAGE_BYTES] = {};
     ssize_t written;
     do
@@ -381,6 +405,8 @@ static lc_status wake(loop_context *context) {
     CHECK_CONDITION(written == static_cast<ssize_t>(sizeof message));
     return LC_OK;
 }
+
+} // namespace
 
 // ---- Work of other threads
 
@@ -395,10 +421,12 @@ void loop_post_work(loop_context *context, loop_post *post) {
         context->posts_last = post;
     }
     if (first)
-        LOG_STATUS(wake(context));
+        LOG_STATUS(wake_owner(context));
 }
 
-static loop_post *take_post(loop_context *context) {
+namespace {
+
+loop_post *take_first_post(loop_context *context) {
     const mutex_guard guard(&context->posts_mutex);
     loop_post *post = context->posts_first;
     if (post) {
@@ -409,14 +437,16 @@ static loop_post *take_post(loop_context *context) {
     return post;
 }
 
-static bool run_posts(loop_context *context) {
+bool run_posts(loop_context *context) {
     bool ran = false;
-    while (loop_post *post = take_post(context)) {
+    while (loop_post *post = take_first_post(context)) {
         post->function(post, 1);
         ran = true;
     }
     return ran;
 }
+
+} // namespace
 
 void loop_run_posted(loop_context *context) {
     const loop_guard guard(context);
@@ -449,8 +479,10 @@ void loop_withdraw_posted(loop_context *context, const void *poster) {
 
 // ---- Rounds
 
-static lc_status wait_round(loop_context *context) {
-    const bool without_waiting = context->noted_first != nullptr;
+namespace {
+
+lc_status wait_for_events(loop_context *context) {
+    const bool without_waiting = context->queue_first != nullptr;
     if (context->descriptors > FDS_MAX) {
         LC_LOG(LC_LOG_ERR, "too many fds");
         return LC_GENERIC;
@@ -460,28 +492,28 @@ static lc_status wait_round(loop_context *context) {
         FAIL_WITH(LC_GENERIC);
     const sigset_t signals = context->owned_signals;
     const uint32_t held = context->lock.count;
-    lock_give(&context->lock, held);
+    give_loop_lock(&context->lock, held);
     pthread_sigmask(SIG_UNBLOCK, &signals, nullptr);
     const int result = event_base_loop(context->base, EVLOOP_ONCE | (without_waiting ? EVLOOP_NONBLOCK : 0));
     pthread_sigmask(SIG_BLOCK, &signals, nullptr);
-    lock_take(&context->lock, held);
+    take_loop_lock(&context->lock, held);
     event_del(context->limit_event);
     if (context->pipe_readable) {
         context->pipe_readable = false;
-        read_pipe(context);
+        read_wake_pipe(context);
     }
-    note_found(context);
+    queue_ready_events(context);
     if (result < 0)
         FAIL_WITH(LC_GENERIC);
     return LC_OK;
 }
 
-static bool run_noted(loop_context *context) {
+bool run_queued_events(loop_context *context) {
     bool ran = run_posts(context);
-    while (loop_event *event = context->noted_first) {
+    while (loop_event *event = context->queue_first) {
         if (context->escape)
             break;
-        const short flags = take_note(event);
+        const short flags = unqueue_event(event);
         if (event->kind == event_kind::timer)
             count_event(event, false);
         event->function(event->number, flags, event->data); // the event may be gone from here on
@@ -490,6 +522,8 @@ static bool run_noted(loop_context *context) {
     }
     return ran;
 }
+
+} // namespace
 
 lc_status loop_run(loop_context *context, bool once, int *out_no_events, int *out_escaped) {
     CHECK_CONDITION(loop_is_own_thread(context));
@@ -502,12 +536,12 @@ lc_status loop_run(loop_context *context, bool once, int *out_no_events, int *ou
         }
         if (once && ran)
             return LC_OK;
-        if (!context->inserted && !context->noted_first) {
+        if (!context->inserted && !context->queue_first) {
             *out_no_events = 1;
             return LC_OK;
         }
-        CHECK_STATUS(wait_round(context));
-        ran = run_noted(context);
+        CHECK_STATUS(wait_for_events(context));
+        ran = run_queued_events(context);
     }
 }
 
@@ -517,18 +551,20 @@ lc_status loop_escape(loop_context *context) {
         context->escape = 1;
     }
     if (!loop_is_own_thread(context))
-        CHECK_STATUS(wake(context));
+        CHECK_STATUS(wake_owner(context));
     return LC_OK;
 }
 
 // ---- Making and freeing
 
-[[noreturn]] static void end_process(const char *function, const char *what) {
+[[noreturn]] static void exit_with_message(const char *function, const char *what) {
     fprintf(stderr, "%s: %s\n", function, what);
     exit(1);
 }
 
-static event_base *new_base() {
+namespace {
+
+event_base *make_event_base() {
     event_config *config = event_config_new();
     if (!config)
         return nullptr;
@@ -540,10 +576,12 @@ static event_base *new_base() {
     return base;
 }
 
+} // namespace
+
 loop_context *loop_new() {
     auto *context = static_cast<loop_context *>(calloc(1, sizeof(loop_context)));
     if (!context)
-        end_process(__func__, "couldn't allocate event context");
+        exit_with_message(__func__, "couldn't allocate event context");
     context->owner = pthread_self();
     context->lock = loop_lock();
     pthread_mutex_init(&context->posts_mutex, nullptr);
@@ -556,14 +594,14 @@ loop_context *loop_new() {
     }
     context->pipe_read = ends[0];
     context->pipe_write = ends[1];
-    context->base = new_base();
+    context->base = make_event_base();
     if (!context->base)
-        end_process(__func__, "no event mechanism available");
+        exit_with_message(__func__, "no event mechanism available");
     context->pipe_event =
-        event_new(context->base, context->pipe_read, EV_READ | EV_PERSIST, pipe_found, context);
-    context->limit_event = event_new(context->base, -1, 0, limit_found, nullptr);
+        event_new(context->base, context->pipe_read, EV_READ | EV_PERSIST, handle_ready_pipe, context);
+    context->limit_event = event_new(context->base, -1, 0, handle_wait_limit, nullptr);
     if (!context->pipe_event || !context->limit_event || event_add(context->pipe_event, nullptr) != 0)
-        end_process(__func__, "couldn't allocate event context");
+        exit_with_message(__func__, "couldn't allocate event context");
     return context;
 }
 
@@ -572,7 +610,7 @@ void loop_free(loop_context **inout) {
     *inout = nullptr;
     if (!context)
         return;
-    while (loop_post *post = take_post(context))
+    while (loop_post *post = take_first_post(context))
         post->function(post, 0);
     event_free(context->limit_event);
     event_free(context->pipe_event);

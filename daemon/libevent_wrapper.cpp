@@ -25,7 +25,9 @@ struct lew {
     array *slots; // the callers' slots, sorted by address, each once
 };
 
-static void free_slot(void *element) {
+namespace {
+
+void free_slot(void *element) {
     auto **slot = static_cast<lew_event **>(element);
     lew_event *event = *slot;
     *slot = nullptr;
@@ -34,7 +36,7 @@ static void free_slot(void *element) {
     free(event);
 }
 
-static lc_status init_steps(lew *context) {
+lc_status init_context(lew *context) {
     array_options options;
     CHECK_STATUS(array_options_get_defaults(&options));
     options.free = free_slot;
@@ -45,12 +47,14 @@ static lc_status init_steps(lew *context) {
     return LC_OK;
 }
 
+} // namespace
+
 lc_status lew_init(lew **out) {
     CHECK_NULL(out);
     *out = nullptr;
     auto *context = static_cast<lew *>(calloc(1, sizeof(lew)));
     CHECK_NULL(context);
-    const lc_status status = init_steps(context);
+    const lc_status status = init_context(context);
     if (status != LC_OK) {
         LOG_STATUS(array_free(&context->slots));
         free(context);
@@ -68,20 +72,22 @@ lc_status lew_get_event_context(lew *context, loop_context **out) {
     return LC_OK;
 }
 
-static lc_status find_slot(const lew *context, lew_event **slot, uint32_t *out_place) {
+namespace {
+
+lc_status find_slot(const lew *context, lew_event **slot, uint32_t *out_place) {
     return array_binary_search(context->slots, slot, out_place);
 }
-static lc_status add_slot(lew *context, lew_event **slot) {
+lc_status add_slot(lew *context, lew_event **slot) {
     void *element = slot;
     return array_insert_sorted_takeover(context->slots, &element);
 }
 
-static void lew_universal_event_handler(int number, short flags, void *data) {
+void lew_universal_event_handler(int number, short flags, void *data) {
     const lew_event event = *static_cast<lew_event *>(data); // its callback may delete it
     LOG_STATUS(event.callback(number, flags, event.data, event.context));
 }
 
-static lc_status make_event(lew *context, lew_event **slot) {
+lc_status make_signal_event(lew *context, lew_event **slot) {
     auto *event = static_cast<lew_event *>(calloc(1, sizeof(lew_event)));
     CHECK_NULL(event);
     event->context = context;
@@ -97,6 +103,8 @@ static lc_status make_event(lew *context, lew_event **slot) {
     return LC_OK;
 }
 
+} // namespace
+
 lc_status lew_event_reg_signal(lew *context, lew_event **slot, int signal_number, lew_callback callback,
                                void *data) {
     CHECK_NULL(context);
@@ -107,7 +115,7 @@ lc_status lew_event_reg_signal(lew *context, lew_event **slot, int signal_number
     uint32_t place;
     const bool made = *slot == nullptr;
     if (made) {
-        CHECK_STATUS(make_event(context, slot));
+        CHECK_STATUS(make_signal_event(context, slot));
     } else {
         CHECK_STATUS(find_slot(context, slot, &place));
         loop_event_remove((*slot)->registered);
@@ -150,7 +158,9 @@ lc_status lew_delete_all_events(lew *context) {
     return LC_OK;
 }
 
-static lc_status dispatch(lew *context, bool once, int *out_no_events, int *out_escaped) {
+namespace {
+
+lc_status run_dispatch(lew *context, bool once, int *out_no_events, int *out_escaped) {
     int no_events = 0, escaped = 0;
     if (out_no_events)
         *out_no_events = 0;
@@ -166,11 +176,13 @@ static lc_status dispatch(lew *context, bool once, int *out_no_events, int *out_
     return LC_OK;
 }
 
+} // namespace
+
 lc_status lew_dispatch(lew *context, int *out_no_events, int *out_escaped) {
-    return dispatch(context, false, out_no_events, out_escaped);
+    return run_dispatch(context, false, out_no_events, out_escaped);
 }
 lc_status lew_dispatch_once(lew *context, int *out_no_events, int *out_escaped) {
-    return dispatch(context, true, out_no_events, out_escaped);
+    return run_dispatch(context, true, out_no_events, out_escaped);
 }
 
 lc_status lew_escape_from_dispatch(lew *context) {

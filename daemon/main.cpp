@@ -5,13 +5,17 @@
 #include "daemon/wccpd_main.h"
 #include "runtime/version.h"
 
-static const char HELP[] =
+namespace {
+
+const char HELP[] =
     "Usage: wccpd\n"
     "Makes this appliance a member of WCCP version 2 service groups. wccpd has no options of its own and no\n"
     "configuration file: it asks mgmtd, which has to run, and logs to syslog.\n"
     "  --help      this text\n"
     "  --version   the version\n"
     "SIGTERM, SIGINT and SIGHUP end it in order. See wccpd(8), mgmtctl(1) and mgmtd.conf(5).\n";
+
+} // namespace
 
 int main(int argc, char **argv) {
     const char *question = argc == 2 ? argv[1] : "";

@@ -52,24 +52,24 @@ bool group_exists(uint8_t id) {
     return wccp_find_group(id) != nullptr;
 }
 
-lc_status is_deleted(const bn_binding *binding, bool *out) {
+lc_status read_deleted_mark(const bn_binding *binding, bool *out) {
     uint32_t flags = 0;
     CHECK_STATUS(bn_binding_get_type(binding, bn_attrib_value, nullptr, &flags));
     *out = (flags & bn_flag_deleted) != 0;
     return LC_OK;
 }
 
-lc_status root_is_deleted(const bn_binding_array *bindings, const char *root, bool *out) {
+lc_status read_root_deleted_mark(const bn_binding_array *bindings, const char *root, bool *out) {
     const bn_binding *binding = nullptr;
     CHECK_STATUS(bn_binding_array_get_binding_by_name(bindings, root, &binding));
     if (!binding)
         CHECK_STATUS(LC_NOT_FOUND);
-    CHECK_STATUS(is_deleted(binding, out));
+    CHECK_STATUS(read_deleted_mark(binding, out));
     return LC_OK;
 }
 
 // The place of the group's root for the name of a router entry, -1 for any other name.
-lc_status root_of_router_entry(const bn_binding_array *bindings, const char *name, int32_t *out_index) {
+lc_status find_root_of_router_entry(const bn_binding_array *bindings, const char *name, int32_t *out_index) {
     constexpr std::string_view list = "/router";
     std::string_view root = name;
     *out_index = -1;
@@ -92,7 +92,7 @@ lc_status count_router_entries(const bn_binding_array *bindings, uint32_t *count
         const char *name = binding ? bn_binding_get_name_quick(binding) : nullptr;
         int32_t root = -1;
         if (name)
-            CHECK_STATUS(root_of_router_entry(bindings, name, &root));
+            CHECK_STATUS(find_root_of_router_entry(bindings, name, &root));
         if (root >= 0)
             counts[root]++;
     }
@@ -101,7 +101,7 @@ lc_status count_router_entries(const bn_binding_array *bindings, uint32_t *count
 
 // ---- Whole groups
 
-void delete_group(uint8_t id, config_change_time time) {
+void delete_engine_group(uint8_t id, config_change_time time) {
     if (time != CONFIG_CHANGE_RUNNING && !group_exists(id))
         QV_LOG(LC_LOG_INFO, "WCCP update: Group %d was deleted before the start read it", id);
     else if (wccp_del_group(id) == 0)
@@ -149,9 +149,9 @@ lc_status wccpd_config_update_group(const char *id_text, const config_walk *walk
     QV_LOG(LC_LOG_INFO, "WCCP config query group %s(%d) - %s", id_text, id, root);
     wccp_grp_config config = {};
     bool deleted = false;
-    CHECK_STATUS(root_is_deleted(walk->bindings, root, &deleted));
+    CHECK_STATUS(read_root_deleted_mark(walk->bindings, root, &deleted));
     if (deleted) {
-        delete_group(id, walk->time);
+        delete_engine_group(id, walk->time);
         leave_policy_group(id);
         return LC_OK;
     }
@@ -174,7 +174,7 @@ lc_status wccpd_config_update_policy_group(const bn_binding_array *bindings, con
     const uint16_t id = static_cast<uint16_t>(strtol(id_text, nullptr, 10));
     QV_LOG(LC_LOG_INFO, "WCCP policy config query group %s(%d) - %s", id_text, id, root);
     bool deleted = false;
-    CHECK_STATUS(root_is_deleted(bindings, root, &deleted));
+    CHECK_STATUS(read_root_deleted_mark(bindings, root, &deleted));
     if (!deleted) {
         if (wccp_add_policy_grp(id, 0, nullptr) == 0)
             QV_LOG(LC_LOG_INFO, "WCCP update: Added policy Group %d", id);
@@ -276,7 +276,7 @@ lc_status change_group(const char *name, const tstr_array *parts, const bn_bindi
         return LC_OK;
     }
     if (deleted) {
-        delete_group(id, time);
+        delete_engine_group(id, time);
         return LC_OK;
     }
     if (!known) {
@@ -314,7 +314,7 @@ lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_binding *b
         return LC_OK;
     }
     bool deleted = false;
-    CHECK_STATUS(is_deleted(binding, &deleted));
+    CHECK_STATUS(read_deleted_mark(binding, &deleted));
     if (wccpd_is_under(name, NODE_WCCPD_CONFIG)) {
         CHECK_STATUS(change_global(name, binding));
     } else if (wccpd_is_under(name, NODE_GROUP_CONFIG)) {

@@ -21,9 +21,9 @@ struct early_change_list {
     early_change **end; // where the next one goes; null when no changes are kept
     size_t bytes;
 };
-early_change_list kept;
+early_change_list kept_changes;
 
-size_t size_of(const bn_binding_array *bindings) {
+size_t estimate_bytes(const bn_binding_array *bindings) {
     size_t bytes = CHANGE_BYTES;
     const uint32_t count = bn_binding_array_length_quick(bindings);
     for (uint32_t i = 0; i < count; i++) {
@@ -38,13 +38,13 @@ size_t size_of(const bn_binding_array *bindings) {
     return bytes;
 }
 
-early_change *take_first() {
-    early_change *change = kept.first;
+early_change *take_first_change() {
+    early_change *change = kept_changes.first;
     if (!change)
         return nullptr;
-    kept.first = change->next;
-    if (!kept.first)
-        kept.end = &kept.first;
+    kept_changes.first = change->next;
+    if (!kept_changes.first)
+        kept_changes.end = &kept_changes.first;
     return change;
 }
 
@@ -56,23 +56,23 @@ void free_change(early_change *change) {
 } // namespace
 
 early_changes_scope::early_changes_scope() {
-    kept.end = &kept.first;
+    kept_changes.end = &kept_changes.first;
 }
 
 early_changes_scope::~early_changes_scope() {
-    while (early_change *change = take_first())
+    while (early_change *change = take_first_change())
         free_change(change);
-    kept = {};
+    kept_changes = {};
 }
 
 bool early_changes_are_kept() {
-    return kept.end != nullptr;
+    return kept_changes.end != nullptr;
 }
 
 lc_status keep_early_change(bn_binding_array **inout_new_values) {
     CHECK_CONDITION(early_changes_are_kept());
-    const size_t bytes = size_of(*inout_new_values);
-    if (bytes > EARLY_CHANGES_MAX_BYTES - kept.bytes) {
+    const size_t bytes = estimate_bytes(*inout_new_values);
+    if (bytes > EARLY_CHANGES_MAX_BYTES - kept_changes.bytes) {
         LC_LOG(LC_LOG_ERR, "Configuration change lost: too much has been changed during the start");
         return LC_NO_SPACE;
     }
@@ -81,19 +81,19 @@ lc_status keep_early_change(bn_binding_array **inout_new_values) {
     change->new_values = *inout_new_values;
     change->time = CONFIG_CHANGE_DURING_START;
     *inout_new_values = nullptr;
-    *kept.end = change;
-    kept.end = &change->next;
-    kept.bytes += bytes;
+    *kept_changes.end = change;
+    kept_changes.end = &change->next;
+    kept_changes.bytes += bytes;
     return LC_OK;
 }
 
 void early_changes_are_answered() {
-    for (early_change *change = kept.first; change; change = change->next)
+    for (early_change *change = kept_changes.first; change; change = change->next)
         change->time = CONFIG_CHANGE_IN_ANSWER;
 }
 
 void apply_early_changes() {
-    while (early_change *change = take_first()) {
+    while (early_change *change = take_first_change()) {
         LOG_STATUS(wccpd_config_apply(change->new_values, change->time));
         free_change(change);
     }

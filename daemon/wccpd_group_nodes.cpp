@@ -30,7 +30,7 @@ namespace {
 
 uint16_t svc_grp_policy[WCCP_MAX_GROUPS];
 
-void store(const group_node *node, wccp_grp_config *config, const char *text, uint32_t value) {
+void store_value(const group_node *node, wccp_grp_config *config, const char *text, uint32_t value) {
     node->set(config, value);
     config->config_flags |= node->flag;
     node->log(text, value);
@@ -49,28 +49,28 @@ lc_status take_word(const group_node *node, wccp_grp_config *config, const bn_bi
         value = node->words->fallback;
     }
     if (value != 0)
-        store(node, config, string, value);
+        store_value(node, config, string, value);
     return LC_OK;
 }
 
 lc_status take_number(const group_node *node, wccp_grp_config *config, const bn_binding *binding) {
     uint32_t value = 0;
     CHECK_STATUS(bn_binding_get_uint32(binding, bn_attrib_value, nullptr, &value));
-    store(node, config, "", value);
+    store_value(node, config, "", value);
     return LC_OK;
 }
 
 lc_status take_port_mask(const group_node *node, wccp_grp_config *config, const bn_binding *binding) {
     uint16_t value = 0;
     CHECK_STATUS(bn_binding_get_uint16(binding, bn_attrib_value, nullptr, &value));
-    store(node, config, "", value);
+    store_value(node, config, "", value);
     return LC_OK;
 }
 
 lc_status take_bool(const group_node *node, wccp_grp_config *config, const bn_binding *binding) {
     uint32_t value = 0;
     CHECK_STATUS(bn_binding_get_tbool(binding, bn_attrib_value, nullptr, &value));
-    store(node, config, value ? "yes" : "no", value ? 1 : 0);
+    store_value(node, config, value ? "yes" : "no", value ? 1 : 0);
     return LC_OK;
 }
 
@@ -148,20 +148,20 @@ constexpr group_node_words::word assign_list[] = {
 constexpr group_node_words::word compatibility_list[] = {{"ios", WCCP_COMPAT_IOS},
                                                          {"nexus", WCCP_COMPAT_NEXUS}};
 
-#define COMPLAIN(format) [](const char *text) { util_log(LC_LOG_ERR, CONFIG_LOG_PREFIX, format, text); }
-constexpr group_node_words admin_words = {admin_list, 0, COMPLAIN("Invalid admin: %s, ignoring")};
+#define LOG_BAD_WORD(format) [](const char *text) { util_log(LC_LOG_ERR, CONFIG_LOG_PREFIX, format, text); }
+constexpr group_node_words admin_words = {admin_list, 0, LOG_BAD_WORD("Invalid admin: %s, ignoring")};
 constexpr group_node_words encap_words = {encap_list, WCCP_METHOD_EITHER,
-                                          COMPLAIN("Invalid forwarding method: %s, using EITHER")};
+                                          LOG_BAD_WORD("Invalid forwarding method: %s, using EITHER")};
 constexpr group_node_words assign_words = {assign_list, WCCP_ASSIGN_EITHER,
-                                           COMPLAIN("Invalid assignment method: %s, using EITHER")};
+                                           LOG_BAD_WORD("Invalid assignment method: %s, using EITHER")};
 constexpr group_node_words compatibility_words = {compatibility_list, WCCP_COMPAT_IOS,
-                                                  COMPLAIN("Invalid compatibility mode: %s, using ios")};
+                                                  LOG_BAD_WORD("Invalid compatibility mode: %s, using ios")};
 
-#define SET(field)                                                                                           \
+#define SET_FIELD(field)                                                                                     \
     [](wccp_grp_config *config, uint32_t value) {                                                            \
         config->field = static_cast<decltype(config->field)>(value);                                         \
     }
-#define LOG_SET(...)                                                                                         \
+#define LOG_VALUE(...)                                                                                       \
     [](const char *text, uint32_t value) {                                                                   \
         (void)text, (void)value;                                                                             \
         util_log(LC_LOG_INFO, CONFIG_LOG_PREFIX, __VA_ARGS__);                                               \
@@ -170,40 +170,40 @@ constexpr group_node_words compatibility_words = {compatibility_list, WCCP_COMPA
 // clang-format off
 constexpr group_node rows[] = {
     {GROUP_NODE_ROUTER, nullptr, false, WCCP_CFG_ROUTERS, take_router, nullptr, nullptr, nullptr},
-    {GROUP_NODE_PRIORITY, "priority", false, 0, take_number, SET(priority),
-     LOG_SET("set priority to %d", static_cast<uint8_t>(value)), nullptr},
+    {GROUP_NODE_PRIORITY, "priority", false, 0, take_number, SET_FIELD(priority),
+     LOG_VALUE("set priority to %d", static_cast<uint8_t>(value)), nullptr},
     {GROUP_NODE_PROTOCOL, "protocol", false, 0, take_protocol, nullptr, nullptr, nullptr},
     {GROUP_NODE_PASSWORD, "password", true, WCCP_CFG_PASSWORD, take_password, nullptr, nullptr, nullptr},
-    {GROUP_NODE_ENCAP, "encap", true, WCCP_CFG_FWD_METHOD, take_word, SET(fwd_method),
-     LOG_SET("set encap %s to %d", text, static_cast<int>(value)), &encap_words},
-    {GROUP_NODE_WEIGHT, "weight", true, WCCP_CFG_WEIGHT, take_number, SET(weight),
-     LOG_SET("set weight to %d", static_cast<uint16_t>(value)), nullptr},
-    {GROUP_NODE_ADMIN, "admin", true, WCCP_CFG_ADMIN, take_word, SET(admin),
-     LOG_SET("set admin %s:%d", text, static_cast<int>(value)), &admin_words},
+    {GROUP_NODE_ENCAP, "encap", true, WCCP_CFG_FWD_METHOD, take_word, SET_FIELD(fwd_method),
+     LOG_VALUE("set encap %s to %d", text, static_cast<int>(value)), &encap_words},
+    {GROUP_NODE_WEIGHT, "weight", true, WCCP_CFG_WEIGHT, take_number, SET_FIELD(weight),
+     LOG_VALUE("set weight to %d", static_cast<uint16_t>(value)), nullptr},
+    {GROUP_NODE_ADMIN, "admin", true, WCCP_CFG_ADMIN, take_word, SET_FIELD(admin),
+     LOG_VALUE("set admin %s:%d", text, static_cast<int>(value)), &admin_words},
     {GROUP_NODE_POLICY_GRP, "policy_grp", true, 0, take_policy, nullptr, nullptr, nullptr},
     {GROUP_NODE_FORCE_L2_RETURN, "force_l2_return", true, WCCP_CFG_FORCE_L2_RETURN, take_bool,
-     SET(force_l2_return), LOG_SET("set force l2 return to %s", text), nullptr},
+     SET_FIELD(force_l2_return), LOG_VALUE("set force l2 return to %s", text), nullptr},
     {GROUP_NODE_INTERFACE, "interface", true, 0, take_interface, nullptr, nullptr, nullptr},
-    {GROUP_NODE_ASSIGN_METHOD, "assign_method", true, WCCP_CFG_ASSIGN_METHOD, take_word, SET(assign_method),
-     LOG_SET("set assignment method to %s", text), &assign_words},
-    {GROUP_NODE_HASH_SRC_IP, "hash_src_ip", true, WCCP_CFG_HASH_SRC_IP, take_bool, SET(hash_src_ip),
-     LOG_SET("set hash src ip to %s", text), nullptr},
-    {GROUP_NODE_HASH_DST_IP, "hash_dst_ip", true, WCCP_CFG_HASH_DST_IP, take_bool, SET(hash_dst_ip),
-     LOG_SET("set hash dst ip to %s", text), nullptr},
-    {GROUP_NODE_HASH_SRC_PORT, "hash_src_port", true, WCCP_CFG_HASH_SRC_PORT, take_bool, SET(hash_src_port),
-     LOG_SET("set hash src port to %s", text), nullptr},
-    {GROUP_NODE_HASH_DST_PORT, "hash_dst_port", true, WCCP_CFG_HASH_DST_PORT, take_bool, SET(hash_dst_port),
-     LOG_SET("set hash dst port to %s", text), nullptr},
-    {GROUP_NODE_MASK_SRC_IP, "mask_src_ip", true, WCCP_CFG_MASK_SRC_IP, take_number, SET(mask_src_ip),
-     LOG_SET("set mask src ip to 0x%x", value), nullptr},
-    {GROUP_NODE_MASK_DST_IP, "mask_dst_ip", true, WCCP_CFG_MASK_DST_IP, take_number, SET(mask_dst_ip),
-     LOG_SET("set mask dst ip to 0x%x", value), nullptr},
+    {GROUP_NODE_ASSIGN_METHOD, "assign_method", true, WCCP_CFG_ASSIGN_METHOD, take_word, SET_FIELD(assign_method),
+     LOG_VALUE("set assignment method to %s", text), &assign_words},
+    {GROUP_NODE_HASH_SRC_IP, "hash_src_ip", true, WCCP_CFG_HASH_SRC_IP, take_bool, SET_FIELD(hash_src_ip),
+     LOG_VALUE("set hash src ip to %s", text), nullptr},
+    {GROUP_NODE_HASH_DST_IP, "hash_dst_ip", true, WCCP_CFG_HASH_DST_IP, take_bool, SET_FIELD(hash_dst_ip),
+     LOG_VALUE("set hash dst ip to %s", text), nullptr},
+    {GROUP_NODE_HASH_SRC_PORT, "hash_src_port", true, WCCP_CFG_HASH_SRC_PORT, take_bool, SET_FIELD(hash_src_port),
+     LOG_VALUE("set hash src port to %s", text), nullptr},
+    {GROUP_NODE_HASH_DST_PORT, "hash_dst_port", true, WCCP_CFG_HASH_DST_PORT, take_bool, SET_FIELD(hash_dst_port),
+     LOG_VALUE("set hash dst port to %s", text), nullptr},
+    {GROUP_NODE_MASK_SRC_IP, "mask_src_ip", true, WCCP_CFG_MASK_SRC_IP, take_number, SET_FIELD(mask_src_ip),
+     LOG_VALUE("set mask src ip to 0x%x", value), nullptr},
+    {GROUP_NODE_MASK_DST_IP, "mask_dst_ip", true, WCCP_CFG_MASK_DST_IP, take_number, SET_FIELD(mask_dst_ip),
+     LOG_VALUE("set mask dst ip to 0x%x", value), nullptr},
     {GROUP_NODE_MASK_SRC_PORT, "mask_src_port", true, WCCP_CFG_MASK_SRC_PORT, take_port_mask,
-     SET(mask_src_port), LOG_SET("set mask src port to 0x%x", value), nullptr},
+     SET_FIELD(mask_src_port), LOG_VALUE("set mask src port to 0x%x", value), nullptr},
     {GROUP_NODE_MASK_DST_PORT, "mask_dst_port", true, WCCP_CFG_MASK_DST_PORT, take_port_mask,
-     SET(mask_dst_port), LOG_SET("set mask dst port to 0x%x", value), nullptr},
-    {GROUP_NODE_COMPATIBILITY, "compatibility", true, WCCP_CFG_COMPATIBILITY, take_word, SET(compatibility),
-     LOG_SET("set compatibility mode to %s(%d)", text, static_cast<int>(value)), &compatibility_words},
+     SET_FIELD(mask_dst_port), LOG_VALUE("set mask dst port to 0x%x", value), nullptr},
+    {GROUP_NODE_COMPATIBILITY, "compatibility", true, WCCP_CFG_COMPATIBILITY, take_word, SET_FIELD(compatibility),
+     LOG_VALUE("set compatibility mode to %s(%d)", text, static_cast<int>(value)), &compatibility_words},
 };
 // clang-format on
 

@@ -62,7 +62,7 @@ struct mon_node {
     void (*ask)(mon_subject *subject, bool *answered) = nullptr;
 };
 
-const char *address_text(be32 address, mon_value *out) {
+const char *put_address(be32 address, mon_value *out) {
     return get_addr_str(4, address, 0, out->text, 46);
 }
 void put_number(mon_value *out, uint32_t number) {
@@ -97,7 +97,7 @@ void ask_load(mon_subject *subject, bool *answered) {
     subject->load_percent = info.load_percent;
 }
 
-long number_part(const mon_subject *subject, uint32_t index) {
+long get_number_part(const mon_subject *subject, uint32_t index) {
     const char *text = tstr_array_get_str_quick(subject->parts, index);
     return text ? strtol(text, nullptr, 10) : 0;
 }
@@ -105,7 +105,7 @@ long number_part(const mon_subject *subject, uint32_t index) {
 void ask_reason(mon_subject *subject, bool *answered) {
     const bool of_group = wccpd_is_under(subject->name, NODE_GROUP_STATE);
     const auto place =
-        static_cast<uint32_t>(number_part(subject, of_group ? NUMBER_PART : SYSTEM_ENTRY_PART));
+        static_cast<uint32_t>(get_number_part(subject, of_group ? NUMBER_PART : SYSTEM_ENTRY_PART));
     *answered = wccp_get_reason(of_group ? subject->group : WCCP_NO_GROUP, place, &subject->reason) == 0 &&
                 subject->reason.reason.code != WCCP_REASON_NONE;
 }
@@ -123,7 +123,7 @@ void ask_interface(mon_subject *subject, bool *answered) {
     *answered = false;
 }
 
-#define VALUE(statement)                                                                                     \
+#define WRITE_VALUE(statement)                                                                               \
     [](const mon_subject *s, mon_value *out) {                                                               \
         (void)s;                                                                                             \
         statement;                                                                                           \
@@ -144,55 +144,58 @@ const mon_dump owners_dump = {WCCP_OWNERS_BYTES,
                               [](csys_display_buf *b, uint8_t g) { return wccp_print_owners(g, b); }, false};
 
 #define REASON_NODES(root)                                                                                   \
-    {root "/reason/*/code", bn_type_str, VALUE(put_words(out, wccp_reason_word(s->reason.reason.code))),     \
-     nullptr, ask_reason},                                                                                   \
-        {root "/reason/*/sender", bn_type_ipv4addr, VALUE(address_text(s->reason.reason.sender, out)),       \
+    {root "/reason/*/code", bn_type_str,                                                                     \
+     WRITE_VALUE(put_words(out, wccp_reason_word(s->reason.reason.code))), nullptr, ask_reason},             \
+        {root "/reason/*/sender", bn_type_ipv4addr, WRITE_VALUE(put_address(s->reason.reason.sender, out)),  \
          nullptr, ask_reason},                                                                               \
-        {root "/reason/*/offered", bn_type_str, VALUE(put_words(out, s->reason.reason.offered.s)), nullptr,  \
-         ask_reason},                                                                                        \
-        {root "/reason/*/wanted", bn_type_str, VALUE(put_words(out, s->reason.reason.wanted.s)), nullptr,    \
-         ask_reason},                                                                                        \
-        {root "/reason/*/count", bn_type_uint32, VALUE(put_count(out, s->reason.reason.count)), nullptr,     \
-         ask_reason},                                                                                        \
-        {root "/reason/*/first", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->reason.first_before)), \
+        {root "/reason/*/offered", bn_type_str, WRITE_VALUE(put_words(out, s->reason.reason.offered.s)),     \
          nullptr, ask_reason},                                                                               \
+        {root "/reason/*/wanted", bn_type_str, WRITE_VALUE(put_words(out, s->reason.reason.wanted.s)),       \
+         nullptr, ask_reason},                                                                               \
+        {root "/reason/*/count", bn_type_uint32, WRITE_VALUE(put_count(out, s->reason.reason.count)),        \
+         nullptr, ask_reason},                                                                               \
+        {root "/reason/*/first", bn_type_duration_ms,                                                        \
+         WRITE_VALUE(put_seconds_as_ms(out, s->reason.first_before)), nullptr, ask_reason},                  \
     {                                                                                                        \
-        root "/reason/*/last", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->reason.last_before)),    \
-            nullptr, ask_reason                                                                              \
+        root "/reason/*/last", bn_type_duration_ms,                                                          \
+            WRITE_VALUE(put_seconds_as_ms(out, s->reason.last_before)), nullptr, ask_reason                  \
     }
 #define INTERFACE_NODE(node, type, value)                                                                    \
-    { NODE_WCCPD_STATE "/interface/*/" node, type, VALUE(value), nullptr, ask_interface }
+    { NODE_WCCPD_STATE "/interface/*/" node, type, WRITE_VALUE(value), nullptr, ask_interface }
 
 // First match wins.
 const mon_node mon_nodes[] = {
-    {NODE_WCCPD_STATE "/proto_ver", bn_type_str, VALUE(put_words(out, "2.0")), nullptr},
-    {NODE_WCCPD_VERSION, bn_type_str, VALUE(put_words(out, wccp_version())), nullptr},
-    {NODE_GROUP_STATE "/*/oper", bn_type_str, VALUE(put_words(out, s->group_info.oper)), nullptr},
-    {NODE_GROUP_STATE "/*/uptime", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->group_info.uptime)),
+    {NODE_WCCPD_STATE "/proto_ver", bn_type_str, WRITE_VALUE(put_words(out, "2.0")), nullptr},
+    {NODE_WCCPD_VERSION, bn_type_str, WRITE_VALUE(put_words(out, wccp_version())), nullptr},
+    {NODE_GROUP_STATE "/*/oper", bn_type_str, WRITE_VALUE(put_words(out, s->group_info.oper)), nullptr},
+    {NODE_GROUP_STATE "/*/uptime", bn_type_duration_ms,
+     WRITE_VALUE(put_seconds_as_ms(out, s->group_info.uptime)), nullptr},
+    {NODE_GROUP_STATE "/*/app_id", bn_type_str, WRITE_VALUE(put_address(s->group_info.appliance_ipa, out)),
      nullptr},
-    {NODE_GROUP_STATE "/*/app_id", bn_type_str, VALUE(address_text(s->group_info.appliance_ipa, out)),
-     nullptr},
-    {NODE_GROUP_STATE "/*/num_routers", bn_type_uint32, VALUE(put_number(out, s->group_info.num_routers)),
-     nullptr},
+    {NODE_GROUP_STATE "/*/num_routers", bn_type_uint32,
+     WRITE_VALUE(put_number(out, s->group_info.num_routers)), nullptr},
     {NODE_GROUP_STATE "/*/num_appliances", bn_type_uint32,
-     VALUE(put_number(out, s->group_info.num_appliances)), nullptr},
-    {NODE_GROUP_STATE "/*/router/*/state", bn_type_str, VALUE(put_words(out, s->router.state)), nullptr},
-    {NODE_GROUP_STATE "/*/router/*/fwd_method", bn_type_str, VALUE(put_words(out, s->router.fwd)), nullptr},
-    {NODE_GROUP_STATE "/*/router/*/assign_method", bn_type_str, VALUE(put_words(out, s->router.assign)),
+     WRITE_VALUE(put_number(out, s->group_info.num_appliances)), nullptr},
+    {NODE_GROUP_STATE "/*/router/*/state", bn_type_str, WRITE_VALUE(put_words(out, s->router.state)),
      nullptr},
-    {NODE_GROUP_STATE "/*/router/*/ret_method", bn_type_str, VALUE(put_words(out, s->router.ret)), nullptr},
-    {NODE_GROUP_STATE "/*/router/*/id", bn_type_ipv4addr, VALUE(address_text(s->router.router_id, out)),
+    {NODE_GROUP_STATE "/*/router/*/fwd_method", bn_type_str, WRITE_VALUE(put_words(out, s->router.fwd)),
      nullptr},
-    {NODE_GROUP_STATE "/*/router/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->router.src_ipa, out)),
+    {NODE_GROUP_STATE "/*/router/*/assign_method", bn_type_str, WRITE_VALUE(put_words(out, s->router.assign)),
      nullptr},
+    {NODE_GROUP_STATE "/*/router/*/ret_method", bn_type_str, WRITE_VALUE(put_words(out, s->router.ret)),
+     nullptr},
+    {NODE_GROUP_STATE "/*/router/*/id", bn_type_ipv4addr, WRITE_VALUE(put_address(s->router.router_id, out)),
+     nullptr},
+    {NODE_GROUP_STATE "/*/router/*/ipaddr", bn_type_ipv4addr,
+     WRITE_VALUE(put_address(s->router.src_ipa, out)), nullptr},
     {NODE_GROUP_STATE "/*/router/*/conn_time", bn_type_duration_ms,
-     VALUE(put_seconds_as_ms(out, s->router.conn_time)), nullptr},
+     WRITE_VALUE(put_seconds_as_ms(out, s->router.conn_time)), nullptr},
     {NODE_GROUP_STATE "/*/router/*/appliance/*/load_dist", bn_type_uint32,
-     VALUE(put_count(out, s->load_percent)), nullptr, ask_load},
-    {NODE_GROUP_STATE "/*/appliance/*/ipaddr", bn_type_ipv4addr, VALUE(address_text(s->appliance.ipa, out)),
-     nullptr},
-    {NODE_GROUP_STATE "/*/appliance/*/weight", bn_type_uint32, VALUE(put_number(out, s->appliance.weight)),
-     nullptr},
+     WRITE_VALUE(put_count(out, s->load_percent)), nullptr, ask_load},
+    {NODE_GROUP_STATE "/*/appliance/*/ipaddr", bn_type_ipv4addr,
+     WRITE_VALUE(put_address(s->appliance.ipa, out)), nullptr},
+    {NODE_GROUP_STATE "/*/appliance/*/weight", bn_type_uint32,
+     WRITE_VALUE(put_number(out, s->appliance.weight)), nullptr},
     {NODE_GROUP_STATE "/*/debug", bn_type_str, nullptr, &group_dump},
     {NODE_GROUP_STATE "/*/assignment", bn_type_str, nullptr, &assignment_dump},
     {NODE_GROUP_STATE "/*/metric/all", bn_type_str, nullptr, &metrics_dump},
@@ -200,18 +203,18 @@ const mon_node mon_nodes[] = {
     {NODE_WCCPD_STATE "/debug_global", bn_type_str, nullptr, &global_dump},
     {NODE_WCCPD_STATE "/debug_all", bn_type_str, nullptr, &all_dump},
     {NODE_WCCPD_STATE "/is_alive", bn_type_str,
-     VALUE(put_words(out, lc_enum_to_string(wccpd_status_table, m_daemon_status))), nullptr},
-    {NODE_GROUP_STATE "/*/since", bn_type_duration_ms, VALUE(put_seconds_as_ms(out, s->group_info.since)),
-     nullptr},
-    {NODE_GROUP_STATE "/*/pending_acks", bn_type_uint32, VALUE(put_count(out, s->group_info.pending_acks)),
-     nullptr},
+     WRITE_VALUE(put_words(out, lc_enum_to_string(wccpd_status_table, m_daemon_status))), nullptr},
+    {NODE_GROUP_STATE "/*/since", bn_type_duration_ms,
+     WRITE_VALUE(put_seconds_as_ms(out, s->group_info.since)), nullptr},
+    {NODE_GROUP_STATE "/*/pending_acks", bn_type_uint32,
+     WRITE_VALUE(put_count(out, s->group_info.pending_acks)), nullptr},
     {NODE_GROUP_STATE "/*/router/*/heard", bn_type_duration_ms,
-     VALUE(put_seconds_as_ms(out, s->router.heard)), nullptr},
-    {NODE_GROUP_STATE "/*/counter/*", bn_type_uint32, VALUE(put_count(out, s->counter)), nullptr,
+     WRITE_VALUE(put_seconds_as_ms(out, s->router.heard)), nullptr},
+    {NODE_GROUP_STATE "/*/counter/*", bn_type_uint32, WRITE_VALUE(put_count(out, s->counter)), nullptr,
      ask_counter},
     REASON_NODES(NODE_GROUP_STATE "/*"),
     REASON_NODES(NODE_WCCPD_STATE),
-    INTERFACE_NODE("address", bn_type_ipv4addr, address_text(s->interface.ipa, out)),
+    INTERFACE_NODE("address", bn_type_ipv4addr, put_address(s->interface.ipa, out)),
     INTERFACE_NODE("link", bn_type_str, put_words(out, s->interface.link_up ? "up" : "down")),
     INTERFACE_NODE("starts", bn_type_uint32, put_count(out, s->interface.starts)),
     INTERFACE_NODE("stops", bn_type_uint32, put_count(out, s->interface.stops)),
@@ -229,11 +232,11 @@ const char *const wildcard_nodes[] = {
     NODE_WCCPD_STATE "/interface/*",
 };
 
-bool matches(const mon_subject *subject, const char *pattern) {
+bool name_matches(const mon_subject *subject, const char *pattern) {
     return bn_binding_name_parts_pattern_match(subject->parts, 1, pattern) != 0;
 }
 
-lc_status append_text(const char *name, uint32_t type, const char *text, bn_binding_array *out) {
+lc_status append_binding(const char *name, uint32_t type, const char *text, bn_binding_array *out) {
     owned_binding binding;
     CHECK_STATUS(bn_binding_new_str(&binding.pointer, name, bn_attrib_value, type, 0, text));
     CHECK_STATUS(bn_binding_array_append_takeover(out, &binding.pointer));
@@ -241,7 +244,7 @@ lc_status append_text(const char *name, uint32_t type, const char *text, bn_bind
 }
 
 lc_status wccpd_mon_handle_get_wildcard(const mon_subject *subject, const char *last, bn_binding_array *out) {
-    CHECK_STATUS(append_text(subject->name, bn_type_str, last, out));
+    CHECK_STATUS(append_binding(subject->name, bn_type_str, last, out));
     return LC_OK;
 }
 
@@ -251,7 +254,7 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
     *answered = true;
     if (!wccpd_is_under(subject->name, NODE_GROUP_STATE))
         return LC_OK;
-    subject->group = static_cast<uint8_t>(number_part(subject, GROUP_PART));
+    subject->group = static_cast<uint8_t>(get_number_part(subject, GROUP_PART));
     const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
     const int group = static_cast<int>(group_text ? strtol(group_text, nullptr, 10) : 0);
     // The parents themselves count as well: a get of one finds no number after it.
@@ -265,7 +268,7 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
             return LC_OK;
         }
     } else {
-        subject->router.router_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
+        subject->router.router_num = static_cast<uint32_t>(get_number_part(subject, NUMBER_PART));
         CHECK_STATUS(wccp_get_grp_router_info(subject->group, &subject->router));
         snprintf(router_appliances, sizeof router_appliances, "%s/%d/router/%d/appliance", NODE_GROUP_STATE,
                  group, static_cast<int>(subject->router.router_num));
@@ -277,7 +280,7 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
         }
     }
     if (lc_is_prefix(appliances, subject->name, 0)) {
-        subject->appliance.appliance_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
+        subject->appliance.appliance_num = static_cast<uint32_t>(get_number_part(subject, NUMBER_PART));
         const int status = wccp_get_grp_appliance_info(subject->group, &subject->appliance);
         if (status != 0) {
             LC_LOG(LC_LOG_ERR, "wccp_get_grp_appliance_info failed: status=%d", status);
@@ -309,7 +312,7 @@ lc_status append_dump(const mon_subject *subject, const mon_node *node, bool in_
     const dump_failures_logged_at level(in_walk ? LC_LOG_INFO : LC_LOG_ERR);
     if (dump->print(buffer, subject->group) != 0 && !dump->cut_text_counts)
         return LC_OK;
-    CHECK_STATUS(append_text(subject->name, node->type, csys_display_buf_text(buffer), out));
+    CHECK_STATUS(append_binding(subject->name, node->type, csys_display_buf_text(buffer), out));
     return LC_OK;
 }
 
@@ -330,7 +333,7 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
     CHECK_NULL(last);
     LC_LOG(LC_LOG_INFO, "MonGet: last_name_part=%s", last);
     for (const char *pattern : wildcard_nodes)
-        if (matches(&subject, pattern)) {
+        if (name_matches(&subject, pattern)) {
             CHECK_STATUS(wccpd_mon_handle_get_wildcard(&subject, last, out));
             return LC_OK;
         }
@@ -339,7 +342,7 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
     if (!answered)
         return LC_OK;
     for (const mon_node &node : mon_nodes) {
-        if (!matches(&subject, node.pattern))
+        if (!name_matches(&subject, node.pattern))
             continue;
         if (node.dump) {
             CHECK_STATUS(append_dump(&subject, &node, in_walk && *static_cast<const bool *>(in_walk), out));
@@ -351,7 +354,7 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
             return LC_OK;
         mon_value value = {};
         node.value(&subject, &value);
-        CHECK_STATUS(append_text(node_name, node.type, value.text, out));
+        CHECK_STATUS(append_binding(node_name, node.type, value.text, out));
         return LC_OK;
     }
     return LC_OK;
@@ -374,8 +377,8 @@ lc_status append_number(tstr_array *out, uint32_t number) {
 
 lc_status iterate_router_appliances(const mon_subject *subject, tstr_array *out) {
     wccp_router_appliance_list list = {};
-    list.group_id = static_cast<uint8_t>(number_part(subject, GROUP_PART));
-    list.router_num = static_cast<uint32_t>(number_part(subject, NUMBER_PART));
+    list.group_id = static_cast<uint8_t>(get_number_part(subject, GROUP_PART));
+    list.router_num = static_cast<uint32_t>(get_number_part(subject, NUMBER_PART));
     const int status = wccp_get_router_appliance_list(&list);
     if (status != 0) {
         LC_LOG(LC_LOG_ERR, "wccp_get_router_appliance_list failed: status=%d", status);
@@ -388,7 +391,7 @@ lc_status iterate_router_appliances(const mon_subject *subject, tstr_array *out)
 
 lc_status iterate_routers(const mon_subject *subject, tstr_array *out) {
     wccp_router_list list = {};
-    list.group_id = static_cast<uint8_t>(number_part(subject, GROUP_PART));
+    list.group_id = static_cast<uint8_t>(get_number_part(subject, GROUP_PART));
     const int status = wccp_get_router_list(&list);
     if (status != 0) {
         LC_LOG(LC_LOG_ERR, "wccp_get_router_list: failed: status=%d", status);
@@ -407,7 +410,7 @@ lc_status append_reasons(int group, tstr_array *out) {
     return LC_OK;
 }
 lc_status iterate_group_reasons(const mon_subject *subject, tstr_array *out) {
-    return append_reasons(static_cast<uint8_t>(number_part(subject, GROUP_PART)), out);
+    return append_reasons(static_cast<uint8_t>(get_number_part(subject, GROUP_PART)), out);
 }
 lc_status iterate_other_reasons(const mon_subject *, tstr_array *out) {
     return append_reasons(WCCP_NO_GROUP, out);
@@ -465,7 +468,7 @@ lc_status wccpd_mon_handle_iterate(const char *node_name, const tstr_array *name
     subject.name = node_name;
     subject.parts = name_parts;
     for (const auto &parent : parents)
-        if (matches(&subject, parent.pattern)) {
+        if (name_matches(&subject, parent.pattern)) {
             CHECK_STATUS(parent.children(&subject, out));
             return LC_OK;
         }

@@ -29,7 +29,7 @@
 
 namespace {
 
-constexpr int64_t LOOKS_IN_LIMIT = 24; // at the lock, within the time of the watchdog
+constexpr int64_t CHECKS_IN_LIMIT = 24; // at the lock, within the time of the watchdog
 constexpr size_t TEXT_BYTES = 256;
 
 loop_event *alive_timer;
@@ -62,12 +62,12 @@ bool may_reach_mgmtd(char *out_missing) {
 
 bool (*const privileges[])(char *out_missing) = {may_lock_memory, may_reach_mgmtd};
 
-void look_alive(int, short, void *) {
+void report_alive(int, short, void *) {
     if (pthread_mutex_trylock(&wccp_g.lock) == 0) {
         pthread_mutex_unlock(&wccp_g.lock);
         service_report("WATCHDOG=1");
     }
-    LOG_STATUS(loop_event_set_timer(alive_timer, service_watchdog_ms() / LOOKS_IN_LIMIT));
+    LOG_STATUS(loop_event_set_timer(alive_timer, service_watchdog_ms() / CHECKS_IN_LIMIT));
 }
 
 } // namespace
@@ -91,8 +91,8 @@ lc_status wccpd_service_ready() {
         return LC_OK;
     loop_context *context = nullptr;
     CHECK_STATUS(lew_get_event_context(wccpd_lwc, &context));
-    CHECK_STATUS(loop_event_new(context, look_alive, nullptr, &alive_timer));
-    look_alive(-1, 0, nullptr);
+    CHECK_STATUS(loop_event_new(context, report_alive, nullptr, &alive_timer));
+    report_alive(-1, 0, nullptr);
     return LC_OK;
 }
 

@@ -17,7 +17,7 @@ char wccp_primary_wan_interface_name[32];
 namespace {
 
 // A node that is absent leaves `out` as it is.
-lc_status read_bool(mdc *handle, const char *node, int32_t *out, bool *out_present) {
+lc_status read_bool_node(mdc *handle, const char *node, int32_t *out, bool *out_present) {
     *out_present = false;
     owned_binding binding;
     CHECK_STATUS(mdc_get_binding(handle, nullptr, nullptr, 0, &binding.pointer, node, nullptr));
@@ -33,18 +33,18 @@ lc_status read_bool(mdc *handle, const char *node, int32_t *out, bool *out_prese
 lc_status mgmt_is_bonding_enabled(mdc *handle, int32_t *out) {
     bool present = false;
     *out = 0;
-    CHECK_STATUS(read_bool(handle, NODE_SYSTEM_BONDING, out, &present));
+    CHECK_STATUS(read_bool_node(handle, NODE_SYSTEM_BONDING, out, &present));
     return LC_OK;
 }
 
 lc_status mgmt_is_10g_enabled(mdc *handle, int32_t *out) {
     bool present = false;
     *out = 0;
-    CHECK_STATUS(read_bool(handle, NODE_SYSTEM_10G, out, &present));
+    CHECK_STATUS(read_bool_node(handle, NODE_SYSTEM_10G, out, &present));
     return LC_OK;
 }
 
-lc_status choose_name(const char *mode, const char **out_name) {
+lc_status choose_interface_name(const char *mode, const char **out_name) {
     if (bonding_enabled) {
         *out_name = "bwan0";
         return LC_OK;
@@ -85,14 +85,14 @@ int wccp_is_system_in_bridge_mode() {
 
 lc_status wccp_init_primary_wan_interface() {
     bool present = false;
-    CHECK_STATUS(read_bool(wccpd_mcc, NODE_SYSTEM_BONDING, &bonding_enabled, &present));
+    CHECK_STATUS(read_bool_node(wccpd_mcc, NODE_SYSTEM_BONDING, &bonding_enabled, &present));
     if (present)
         LC_LOG(LC_LOG_INFO, "bonding_enabled: %s", lc_bool_to_str(bonding_enabled));
     owned_tstring mode;
     CHECK_STATUS(read_system_mode(&mode));
     LC_LOG(LC_LOG_INFO, "system mode is %s", ts_str(mode.pointer));
     const char *name = nullptr;
-    CHECK_STATUS(choose_name(ts_str(mode.pointer), &name));
+    CHECK_STATUS(choose_interface_name(ts_str(mode.pointer), &name));
     strlcpy(wccp_primary_wan_interface_name, name, sizeof wccp_primary_wan_interface_name);
     return LC_OK;
 }

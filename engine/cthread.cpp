@@ -28,26 +28,28 @@
 #include "runtime/list.h"
 #include "runtime/logging.h"
 
-static constexpr uint32_t CPU_LIMIT = 128;
+namespace {
 
-static pthread_mutex_t thread_list_mutex = PTHREAD_MUTEX_INITIALIZER;
-static cthread *thread_list;
+constexpr uint32_t CPU_LIMIT = 128;
 
-static void *no_start_fn(void *) {
+pthread_mutex_t thread_list_mutex = PTHREAD_MUTEX_INITIALIZER;
+cthread *thread_list;
+
+void *exit_at_start(void *) {
     pthread_exit(nullptr);
 }
 
-static void *no_end_fn(void *) {
+void *exit_at_end(void *) {
     pthread_exit(reinterpret_cast<void *>(intptr_t{-1}));
 }
 
-static uint64_t milliseconds_since_boot() {
+uint64_t milliseconds_since_boot() {
     timespec now = {};
     clock_gettime(CLOCK_BOOTTIME, &now);
     return static_cast<uint64_t>(now.tv_sec) * 1000 + static_cast<uint64_t>(now.tv_nsec) / 1000000;
 }
 
-static void *thread_main(void *argument) {
+void *thread_main(void *argument) {
     auto *context = static_cast<cthread *>(argument);
     char kernel_name[16];
     strlcpy(kernel_name, context->name, sizeof kernel_name);
@@ -66,6 +68,8 @@ static void *thread_main(void *argument) {
     return context->end_fn(context->end_arg);
 }
 
+} // namespace
+
 cthread *cthread_init(const char *name, void *(*start_fn)(void *), void *start_arg, void *(*end_fn)(void *),
                       void *end_arg, uint32_t policy, int32_t priority, uint32_t cpu, uint32_t max_wait) {
     auto *context = static_cast<cthread *>(calloc(1, sizeof(cthread)));
@@ -74,9 +78,9 @@ cthread *cthread_init(const char *name, void *(*start_fn)(void *), void *start_a
         return nullptr;
     }
     strlcpy(context->name, name ? name : "", sizeof context->name);
-    context->start_fn = start_fn ? start_fn : no_start_fn;
+    context->start_fn = start_fn ? start_fn : exit_at_start;
     context->start_arg = start_arg;
-    context->end_fn = end_fn ? end_fn : no_end_fn;
+    context->end_fn = end_fn ? end_fn : exit_at_end;
     context->end_arg = end_arg;
     context->policy = policy;
     context->priority = priority;
@@ -85,7 +89,9 @@ cthread *cthread_init(const char *name, void *(*start_fn)(void *), void *start_a
     return context;
 }
 
-static int build_attributes(pthread_attr_t *attributes, const cthread *context) {
+namespace {
+
+int build_thread_attributes(pthread_attr_t *attributes, const cthread *context) {
     if (pthread_attr_init(attributes) != 0)
         return 1;
     const int policy = static_cast<int>(context->policy);
@@ -100,8 +106,10 @@ static int build_attributes(pthread_attr_t *attributes, const cthread *context) 
     return 1;
 }
 
+} // namespace
+
 int cthread_start(cthread *context) {
-    if (!context || build_attributes(&context->attributes, context))
+    if (!context || build_thread_attributes(&context->attributes, context))
         return 1;
     sigset_t all, previous;
     sigfillset(&all);
@@ -119,26 +127,30 @@ int cthread_start(cthread *context) {
     return 0;
 }
 
+namespace {
+
 // thread_list_mutex held.
-static void unlist(cthread *context) {
+void remove_from_thread_list(cthread *context) {
     if (!context->listed)
         return;
     list_unlink(context);
     context->listed = 0;
 }
 
-static void cancel(cthread *context) {
+void cancel_thread(cthread *context) {
     const int error = pthread_cancel(context->thread);
     if (error != 0)
         QV_LOG(LC_LOG_ERR, "%s: failed to cancel %s with error %d\n", "cthread_cancel", context->name, error);
 }
 
+} // namespace
+
 void cthread_cancel(cthread *context) {
     if (!context || context->heartbeat == 0)
         return;
     const mutex_guard guard(&thread_list_mutex);
-    unlist(context);
-    cancel(context);
+    remove_from_thread_list(context);
+    cancel_thread(context);
 }
 
 void cthread_join(cthread *context) {
@@ -147,7 +159,7 @@ void cthread_join(cthread *context) {
     if (context->heartbeat != 0) { // 0: never started
         {
             const mutex_guard guard(&thread_list_mutex);
-            unlist(context);
+            remove_from_thread_list(context);
         }
         pthread_join(context->thread, nullptr);
         pthread_attr_destroy(&context->attributes);
@@ -162,7 +174,7 @@ cthread *cthread_cancel_listed() {
     for (cthread *context = chain; context; context = context->next) {
         context->prev_link = nullptr;
         context->listed = 0;
-        cancel(context);
+        cancel_thread(context);
     }
     return chain;
 }

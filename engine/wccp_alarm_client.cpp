@@ -31,49 +31,51 @@
 #include "mgmt/client_session.h"
 #include "runtime/logging.h"
 
-static lew *qv_alm_lwc;
-static gcl_session *session; // while it opens the alarm thread's alone
-static mdc *qv_alm_mcc;
-static std::atomic<int32_t> qv_exiting;
-static gcl *qv_alm_instance;
-static fdic *qv_alm_interests;
-static fdic_libevent *qv_alm_bridge;
-static int32_t qv_response_expected;
-static int32_t qv_expected_request_id;
-static bn_response_msg *qv_captured_response;
-static mgmt_client qv_alm_client = {&qv_alm_lwc,
-                                    &session,
-                                    &qv_alm_mcc,
-                                    &qv_response_expected,
-                                    &qv_expected_request_id,
-                                    &qv_captured_response,
-                                    &qv_exiting,
-                                    "qv_alm_mgmt_handle_response :",
-                                    &qv_alm_instance,
-                                    &qv_alm_interests,
-                                    &qv_alm_bridge};
+namespace {
 
-static pthread_t alarm_thread;
-static std::atomic<bool> alarm_thread_runs; // the thread handle is set
-static sem_t started;
-static bool started_exists; // changes while no alarm thread runs, or none that will look at it again
-static pthread_mutex_t loop_mutex = PTHREAD_MUTEX_INITIALIZER; // guards qv_alm_lwc until the thread has ended
+lew *qv_alm_lwc;
+gcl_session *alarm_session; // while it opens the alarm thread's alone
+mdc *qv_alm_mcc;
+std::atomic<int32_t> qv_exiting;
+gcl *qv_alm_instance;
+fdic *qv_alm_interests;
+fdic_libevent *qv_alm_bridge;
+int32_t qv_response_expected;
+int32_t qv_expected_request_id;
+bn_response_msg *qv_captured_response;
+mgmt_client qv_alm_client = {&qv_alm_lwc,
+                             &alarm_session,
+                             &qv_alm_mcc,
+                             &qv_response_expected,
+                             &qv_expected_request_id,
+                             &qv_captured_response,
+                             &qv_exiting,
+                             "qv_alm_mgmt_handle_response :",
+                             &qv_alm_instance,
+                             &qv_alm_interests,
+                             &qv_alm_bridge};
 
-static lc_status qv_alm_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
+pthread_t alarm_thread;
+std::atomic<bool> alarm_thread_runs; // the thread handle is set
+sem_t start_semaphore;
+bool start_semaphore_exists; // changes while no alarm thread runs, or none that will look at it again
+pthread_mutex_t loop_mutex = PTHREAD_MUTEX_INITIALIZER; // guards qv_alm_lwc until the thread has ended
+
+lc_status qv_alm_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
     CHECK_STATUS(mgmt_client_response(&qv_alm_client, response));
     return LC_OK;
 }
 
-static lc_status qv_alm_mgmt_handle_event_response(gcl_session *, bn_response_msg *, void *) {
+lc_status qv_alm_mgmt_handle_event_response(gcl_session *, bn_response_msg *, void *) {
     return LC_OK;
 }
 
-static lc_status qv_alm_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
-                                         bn_response_msg **out_response) {
+lc_status qv_alm_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
+                                  bn_response_msg **out_response) {
     return mgmt_client_request(&qv_alm_client, request, out_response);
 }
 
-static lc_status qv_alm_mgmt_handle_session_close(int, uint32_t, void *, void *) {
+lc_status qv_alm_mgmt_handle_session_close(int, uint32_t, void *, void *) {
     if (qv_exiting)
         return LC_OK;
     qv_response_expected = 0;
@@ -82,19 +84,19 @@ static lc_status qv_alm_mgmt_handle_session_close(int, uint32_t, void *, void *)
     return LC_OK;
 }
 
-static lc_status qv_alm_mgmt_open_session(const char *client_name) {
+lc_status qv_alm_mgmt_open_session(const char *client_name) {
     const lc_status status = mgmt_client_open(&qv_alm_client, client_name, qv_alm_mgmt_msg_handler);
     if (status != LC_OK && status != LC_CANCELLED)
         LC_LOG(LC_LOG_ERR, "Unable to connect to the management daemon");
     return status;
 }
 
-static lew *made_loop() {
+lew *get_alarm_loop() {
     const mutex_guard guard(&loop_mutex);
     return qv_alm_lwc;
 }
 
-static lc_status make_loop() {
+lc_status create_alarm_loop() {
     const mutex_guard guard(&loop_mutex);
     if (qv_exiting)
         return LC_CANCELLED;
@@ -102,12 +104,12 @@ static lc_status make_loop() {
     return LC_OK;
 }
 
-static lc_status qv_alm_mgmt_init_client() {
+lc_status qv_alm_mgmt_init_client() {
     return mgmt_client_init(&qv_alm_client, qv_alm_mgmt_handle_session_close);
 }
 
-static lc_status start_session(const char *client_name) {
-    CHECK_STATUS(make_loop());
+lc_status start_alarm_session(const char *client_name) {
+    CHECK_STATUS(create_alarm_loop());
     CHECK_STATUS(qv_alm_mgmt_init_client());
     CHECK_STATUS(
         bn_set_global_callback_query_response_msg(qv_alm_instance, qv_alm_mgmt_handle_response, nullptr));
@@ -117,24 +119,24 @@ static lc_status start_session(const char *client_name) {
                                                            nullptr));
     CHECK_STATUS(qv_alm_mgmt_open_session(client_name));
     const mutex_guard guard(&qv_alm_session_mutex);
-    qv_alm_mgmt_session = session;
+    qv_alm_mgmt_session = alarm_session;
     return LC_OK;
 }
 
 // Wakes the main thread, which may be waiting in its loop; the posted work itself does nothing.
-static void tell_started() {
+void report_start() {
     static loop_post wake = {nullptr, nullptr, [](loop_post *, int) {}};
     loop_context *main_loop = nullptr;
-    if (!started_exists)
+    if (!start_semaphore_exists)
         return;
-    sem_post(&started);
+    sem_post(&start_semaphore);
     if (wccpd_lwc && lew_get_event_context(wccpd_lwc, &main_loop) == LC_OK)
         loop_post_work(main_loop, &wake);
 }
 
-static void *qv_alm_thread(void *client_name) {
-    const lc_status status = start_session(static_cast<const char *>(client_name));
-    tell_started();
+void *qv_alm_thread(void *client_name) {
+    const lc_status status = start_alarm_session(static_cast<const char *>(client_name));
+    report_start();
     if (status != LC_OK) {
         if (status != LC_CANCELLED)
             LC_LOG(LC_LOG_ERR, "qv_alm_thread: failed to initialize alarm session");
@@ -146,7 +148,7 @@ static void *qv_alm_thread(void *client_name) {
 }
 
 // Signals are the main thread's, and locked memory is dear.
-static int create_thread(const char *client_name) {
+int create_alarm_thread(const char *client_name) {
     pthread_attr_t attributes;
     pthread_attr_init(&attributes);
     pthread_attr_setstacksize(&attributes, CTHREAD_STACK_BYTES);
@@ -161,10 +163,10 @@ static int create_thread(const char *client_name) {
 }
 
 // Until the alarm thread has posted, or an exit has begun, which ends that thread or waits for nobody.
-static void wait_for_start() {
+void wait_for_start() {
     int no_events = 0;
     bool has_loop = wccpd_lwc != nullptr;
-    while ((has_loop ? sem_trywait(&started) : sem_wait(&started)) != 0) {
+    while ((has_loop ? sem_trywait(&start_semaphore) : sem_wait(&start_semaphore)) != 0) {
         if (!has_loop)
             continue; // a signal
         if (wccpd_shutdown_in_progress())
@@ -173,26 +175,28 @@ static void wait_for_start() {
     }
 }
 
+} // namespace
+
 lc_status qv_alm_mgmt_init(const char *client_name) {
-    started_exists = sem_init(&started, 0, 0) == 0;
-    if (!started_exists)
+    start_semaphore_exists = sem_init(&start_semaphore, 0, 0) == 0;
+    if (!start_semaphore_exists)
         LC_LOG(LC_LOG_ERR, "Failed to init alm semaphore (%s), proceeding without it...", strerror(errno));
-    const int result = create_thread(client_name);
+    const int result = create_alarm_thread(client_name);
     alarm_thread_runs = result == 0;
     if (result != 0)
         LC_LOG(LC_LOG_ERR, "Failed to create alarm thread : %s ", strerror(result));
-    if (started_exists) {
+    if (start_semaphore_exists) {
         if (result == 0)
             wait_for_start();
-        sem_destroy(&started);
-        started_exists = false;
+        sem_destroy(&start_semaphore);
+        start_semaphore_exists = false;
     }
     return result;
 }
 
 lc_status qv_alm_mgmt_shutdown() {
     LC_LOG(LC_LOG_INFO, "qv_alm_mgmt_shutdown: cancel alm thread");
-    if (lew *loop = made_loop())
+    if (lew *loop = get_alarm_loop())
         CHECK_STATUS(lew_escape_from_dispatch(loop));
     if (alarm_thread_runs && !pthread_equal(alarm_thread, pthread_self())) {
         const int result = pthread_join(alarm_thread, nullptr);
@@ -211,7 +215,7 @@ lc_status qv_alm_mgmt_shutdown() {
 lc_status qv_initiate_exit() {
     qv_exiting = 1;
     CHECK_STATUS(qv_alm_mgmt_shutdown());
-    if (lew *loop = made_loop())
+    if (lew *loop = get_alarm_loop())
         CHECK_STATUS(lew_escape_from_dispatch(loop));
     return LC_OK;
 }

@@ -23,11 +23,13 @@
 std::atomic<gcl_session *> qv_alm_mgmt_session;
 pthread_mutex_t qv_alm_session_mutex = PTHREAD_MUTEX_INITIALIZER;
 
-static constexpr uint32_t CHECK_DELAY = 60; // seconds
+namespace {
+
+constexpr uint32_t CHECK_DELAY = 60; // seconds
 
 // Arming.
 
-static uint32_t arm_check(wccp_timer *timer, int restart) {
+uint32_t arm_check_timer(wccp_timer *timer, int restart) {
     uint32_t length = CHECK_DELAY;
     if (!restart && timer->active == 1 && timer->countdown != 0)
         length = timer->countdown;
@@ -35,15 +37,17 @@ static uint32_t arm_check(wccp_timer *timer, int restart) {
     return length;
 }
 
+} // namespace
+
 void wccp_alarm_schedule_verify_router_connectivity_timer(wccp_service_group *group, int restart) {
-    const uint32_t length = arm_check(&group->router_alarm_timer, restart);
+    const uint32_t length = arm_check_timer(&group->router_alarm_timer, restart);
     group->alarm_router_sched++;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: schedule router connectivity verify timer in %d seconds",
            group->id, static_cast<int>(length));
 }
 
 void wccp_alarm_schedule_verify_allocation_table_timer(wccp_service_group *group, int restart) {
-    const uint32_t length = arm_check(&group->assign_alarm_timer, restart);
+    const uint32_t length = arm_check_timer(&group->assign_alarm_timer, restart);
     group->alarm_assign_sched++;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: schedule assignment table verify timer in %d seconds", group->id,
            static_cast<int>(length));
@@ -66,7 +70,7 @@ const alarm_kind alarm_kinds[] = {
      "WCCP GRP %d: alarm: raising assignment table mismatch alarm",
      "WCCP GRP %d: alarm: clearing assignment table alarm"},
 };
-const alarm_kind *find_kind(uint16_t bit) {
+const alarm_kind *find_alarm_kind(uint16_t bit) {
     for (const alarm_kind &kind : alarm_kinds)
         if (kind.bit == bit)
             return &kind;
@@ -102,7 +106,7 @@ lc_status send_event(const char *event, const event_field (&fields)[Count]) {
     return LC_OK;
 }
 
-void tell_alarm(wccp_service_group *group, const alarm_kind *kind, const char *event, const char *text) {
+void send_alarm(wccp_service_group *group, const alarm_kind *kind, const char *event, const char *text) {
     snprintf(alarm_param_3, sizeof alarm_param_3, "%s:grp:%d",
              group->interfaces[0] ? group->interfaces[0]->name : "", group->id);
     snprintf(alarm_comment, sizeof alarm_comment, text, group->id);
@@ -120,25 +124,25 @@ void tell_alarm(wccp_service_group *group, const alarm_kind *kind, const char *e
 }
 
 void wccp_alarm_raise_alarm(wccp_service_group *group, uint16_t bit) {
-    if (const alarm_kind *kind = find_kind(bit))
-        tell_alarm(group, kind, EVENT_RAISE_ALARM, kind->raised);
+    if (const alarm_kind *kind = find_alarm_kind(bit))
+        send_alarm(group, kind, EVENT_RAISE_ALARM, kind->raised);
     group->raised_alarms |= bit;
 }
 
 void wccp_alarm_clear_alarm(wccp_service_group *group, uint16_t bit) {
-    if (const alarm_kind *kind = find_kind(bit))
-        tell_alarm(group, kind, EVENT_CLEAR_ALARM, kind->cleared);
+    if (const alarm_kind *kind = find_alarm_kind(bit))
+        send_alarm(group, kind, EVENT_CLEAR_ALARM, kind->cleared);
     group->raised_alarms = static_cast<uint16_t>(group->raised_alarms & ~bit);
 }
 
-bool stands(const wccp_service_group *group, uint16_t bit) {
+bool alarm_is_active(const wccp_service_group *group, uint16_t bit) {
     return (group->raised_alarms & bit) != 0;
 }
 
 } // namespace
 
 void wccp_alarm_raise_router_down_alarm(wccp_service_group *group) {
-    if (!stands(group, WCCP_ALARM_ADJACENCY))
+    if (!alarm_is_active(group, WCCP_ALARM_ADJACENCY))
         wccp_alarm_raise_alarm(group, WCCP_ALARM_ADJACENCY);
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 1);
 }
@@ -147,7 +151,7 @@ void wccp_alarms_clear_all_raised_alarms(wccp_service_group *group) {
     group->router_alarm_timer.active = 0;
     group->assign_alarm_timer.active = 0;
     for (const alarm_kind &kind : alarm_kinds)
-        if (stands(group, kind.bit))
+        if (alarm_is_active(group, kind.bit))
             wccp_alarm_clear_alarm(group, kind.bit);
 }
 
@@ -186,7 +190,7 @@ int wccp_alarm_verify_router_connectivity(wccp_service_group *group) {
     }
     const uint32_t expected = group->mcast_configured == 1 ? 1 : group->ucast_router_count;
     const bool healthy = one_way == 0 && two_way >= expected;
-    const bool raised = stands(group, WCCP_ALARM_ADJACENCY);
+    const bool raised = alarm_is_active(group, WCCP_ALARM_ADJACENCY);
     if (healthy && raised) {
         QV_LOG(LC_LOG_INFO,
                "WCCP GRP %d: alarm: clearing router down alarm: routers one-way: %d two-way: %d configured: "
@@ -208,13 +212,15 @@ int wccp_alarm_verify_router_connectivity(wccp_service_group *group) {
     return 0;
 }
 
-static bool is_without_its_share(const wccp_rtr_view_appliance *entry) {
+namespace {
+
+bool lacks_its_share(const wccp_rtr_view_appliance *entry) {
     return entry->buckets_assigned == 0 && entry->weight != 0;
 }
 
 // What a router gives to an appliance, or to any, and what it should give at least.
-static void note_difference(wccp_service_group *group, const wccp_sending_router *router, be32 appliance,
-                            uint32_t has, uint32_t wanted) {
+void note_assignment_difference(wccp_service_group *group, const wccp_sending_router *router, be32 appliance,
+                                uint32_t has, uint32_t wanted) {
     const wccp_addr_text who = addr_text(appliance);
     wccp_note_reason(group, WCCP_REASON_ASSIGNMENT_DIFFERS, router->router_id,
                      wccp_reason_value("%u buckets for %s", has, is_zero(appliance) ? "anybody" : who.s),
@@ -222,7 +228,7 @@ static void note_difference(wccp_service_group *group, const wccp_sending_router
 }
 
 // What the designated appliance asked for, against what each router reports.
-static bool routers_carry_out_our_table(wccp_service_group *group) {
+bool routers_use_our_table(wccp_service_group *group) {
     for (uint32_t i = 0; i < WCCP_MAX_APPLIANCES; i++) {
         const wccp_dsg_appliance *asked = &group->dsg_appliances[i];
         if (asked->assigned == 0)
@@ -240,20 +246,20 @@ static bool routers_carry_out_our_table(wccp_service_group *group) {
                    "WCCP GRP %d: alarm: allocation mismatch. appliance %s buckets dsg: %d router %s %d",
                    group->id, addr_text(asked->ipa).s, asked->assigned, addr_text(router->router_id).s,
                    static_cast<int>(buckets));
-            note_difference(group, router, asked->ipa, buckets, asked->assigned);
+            note_assignment_difference(group, router, asked->ipa, buckets, asked->assigned);
             return false;
         }
     }
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next) {
         for (uint32_t i = 0; i < router->view_appliance_count; i++) {
             const wccp_rtr_view_appliance *entry = &router->view_appliances[i];
-            if (!is_without_its_share(entry))
+            if (!lacks_its_share(entry))
                 continue;
             QV_LOG(LC_LOG_WARNING,
                    "WCCP GRP %d: alarm: allocation mismatch. appliance %s weight : %d router %s buckets : %d",
                    group->id, addr_text(entry->ipa).s, entry->weight, addr_text(router->router_id).s,
                    entry->buckets_assigned);
-            note_difference(group, router, entry->ipa, 0, 1);
+            note_assignment_difference(group, router, entry->ipa, 0, 1);
             return false;
         }
     }
@@ -261,36 +267,38 @@ static bool routers_carry_out_our_table(wccp_service_group *group) {
 }
 
 // Any other appliance looks only for holes.
-static bool routers_redirect_without_holes(wccp_service_group *group) {
+bool routers_redirect_without_holes(wccp_service_group *group) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: verify by non-designator.", group->id);
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next) {
         bool redirects = false;
         for (uint32_t i = 0; i < router->view_appliance_count; i++) {
             const wccp_rtr_view_appliance *entry = &router->view_appliances[i];
             redirects |= entry->buckets_assigned != 0;
-            if (!is_without_its_share(entry))
+            if (!lacks_its_share(entry))
                 continue;
             QV_LOG(LC_LOG_WARNING,
                    "WCCP GRP %d: alarm: router %s is not redirecting to appliance (%s weight %d)", group->id,
                    addr_text(router->router_id).s, addr_text(entry->ipa).s, entry->weight);
-            note_difference(group, router, entry->ipa, 0, 1);
+            note_assignment_difference(group, router, entry->ipa, 0, 1);
             return false;
         }
         if (!redirects) {
             QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: alarm: router %s is not redirecting to ANY appliance.",
                    group->id, addr_text(router->router_id).s);
-            note_difference(group, router, {}, 0, 1);
+            note_assignment_difference(group, router, {}, 0, 1);
             return false;
         }
     }
     return true;
 }
 
+} // namespace
+
 int wccp_alarms_verify_allocation_table(wccp_service_group *group) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: verify assignment table.", group->id);
     const bool in_order =
-        group->designated == 1 ? routers_carry_out_our_table(group) : routers_redirect_without_holes(group);
-    const bool raised = stands(group, WCCP_ALARM_ASSIGNMENT);
+        group->designated == 1 ? routers_use_our_table(group) : routers_redirect_without_holes(group);
+    const bool raised = alarm_is_active(group, WCCP_ALARM_ASSIGNMENT);
     wccp_forget_older_reasons(group, WCCP_REASON_ASSIGNMENT_DIFFERS);
     if (in_order && raised)
         wccp_alarm_clear_alarm(group, WCCP_ALARM_ASSIGNMENT);

@@ -32,7 +32,11 @@
 #include "engine/wccp_utils.h"
 #include "runtime/guards.h"
 
-static constexpr uint16_t FALLBACK_WEIGHT = 100;
+namespace {
+
+constexpr uint16_t FALLBACK_WEIGHT = 100;
+
+} // namespace
 
 void wccp_designated_appliance_assignment_start(wccp_service_group *group) {
     group->bucket_count = 0;
@@ -40,8 +44,10 @@ void wccp_designated_appliance_assignment_start(wccp_service_group *group) {
         group->dsg_appliances[i].up = 0;
 }
 
+namespace {
+
 // Takes the down entry with the fewest slots out, the later one of equals. False when no entry is down.
-static bool make_room(wccp_service_group *group) {
+bool drop_smallest_down_entry(wccp_service_group *group) {
     wccp_dsg_appliance *const entries = group->dsg_appliances;
     uint32_t least = WCCP_MAX_APPLIANCES;
     for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
@@ -56,6 +62,8 @@ static bool make_room(wccp_service_group *group) {
     return true;
 }
 
+} // namespace
+
 void wccp_designated_appliance_assignment_add(wccp_service_group *group,
                                               const wccp_view_appliance *appliance) {
     if (wccp_dsg_appliance *entry =
@@ -64,7 +72,7 @@ void wccp_designated_appliance_assignment_add(wccp_service_group *group,
         entry->weight = appliance->weight;
         return;
     }
-    if (group->dsg_appliance_count >= WCCP_MAX_APPLIANCES && !make_room(group)) {
+    if (group->dsg_appliance_count >= WCCP_MAX_APPLIANCES && !drop_smallest_down_entry(group)) {
         QV_LOG(LC_LOG_WARNING,
                "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) is one too many.",
                group->id, addr_text(appliance->ipa).s, appliance->weight);
@@ -74,8 +82,10 @@ void wccp_designated_appliance_assignment_add(wccp_service_group *group,
         .ipa = appliance->ipa, .up = 1, .weight = appliance->weight, .assigned = 0};
 }
 
+namespace {
+
 // The number of slots that the agreed method has, 0 when none is agreed.
-static uint32_t slots_of_method(wccp_service_group *group) {
+uint32_t count_slots_of_method(wccp_service_group *group) {
     switch (group->assign_method) {
     case WCCP_ASSIGN_HASH:
         return WCCP_MAX_BUCKETS;
@@ -90,7 +100,7 @@ static uint32_t slots_of_method(wccp_service_group *group) {
     }
 }
 
-static void compute_table(wccp_service_group *group) {
+void compute_group_table(wccp_service_group *group) {
     wccp_dsg_appliance entries[WCCP_MAX_APPLIANCES]; // sorted, while dsg_appliances keeps its order
     memcpy(entries, group->dsg_appliances, group->dsg_appliance_count * sizeof entries[0]);
     for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
@@ -104,14 +114,14 @@ static void compute_table(wccp_service_group *group) {
             static_cast<int>(group->dsg_active_count));
         return;
     }
-    group->bucket_count = slots_of_method(group);
+    group->bucket_count = count_slots_of_method(group);
     if (group->bucket_count != 0)
         wccp_compute_assignment_table(group->dsg_appliance_count, entries, group->bucket_count,
                                       group->bucket_ipa, 0);
 }
 
 // Moves the active entries forward, in their order, and zeroes the places after them.
-static uint32_t close_gaps(wccp_service_group *group) {
+uint32_t remove_down_entries(wccp_service_group *group) {
     uint32_t kept = 0;
     for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
         if (group->dsg_appliances[i].up == 1)
@@ -121,11 +131,13 @@ static uint32_t close_gaps(wccp_service_group *group) {
     return kept;
 }
 
+} // namespace
+
 void wccp_designated_appliance_assignment_finish(wccp_service_group *group) {
     group->bucket_count = 0;
     group->dsg_active_count = 0;
-    compute_table(group);
-    const uint32_t kept = close_gaps(group);
+    compute_group_table(group);
+    const uint32_t kept = remove_down_entries(group);
     if (kept == 0) {
         wccp_designated_appliance_assignment_cleanup(group);
         return;
@@ -152,21 +164,21 @@ void wccp_designated_appliance_assignment_cleanup(wccp_service_group *group) {
 
 namespace {
 
-void free_words(be32 *words) {
+void free_address_array(be32 *words) {
     wccp_free(words);
 }
-void free_weights(uint16_t *weights) {
+void free_weight_array(uint16_t *weights) {
     wccp_free(weights);
 }
-void free_numbers(uint32_t *numbers) {
+void free_number_array(uint32_t *numbers) {
     wccp_free(numbers);
 }
-using owned_words = owned<be32, free_words>;
-using owned_weights = owned<uint16_t, free_weights>;
-using owned_numbers = owned<uint32_t, free_numbers>;
+using owned_address_array = owned<be32, free_address_array>;
+using owned_weight_array = owned<uint16_t, free_weight_array>;
+using owned_number_array = owned<uint32_t, free_number_array>;
 
 template <typename T>
-T *work_array(uint32_t count) {
+T *allocate_work_array(uint32_t count) {
     return static_cast<T *>(wccp_calloc(count, sizeof(T)));
 }
 
@@ -182,7 +194,7 @@ static_assert(offsetof(wccp_dsg_appliance, ipa) == 0);
 struct slot_run {
     uint32_t begin, length;
 };
-slot_run find_run(const be32 *table, uint32_t slots, be32 address) {
+slot_run find_slot_run(const be32 *table, uint32_t slots, be32 address) {
     slot_run run = {0, 0};
     while (run.begin < slots && !(table[run.begin] == address))
         run.begin++;
@@ -197,10 +209,10 @@ void wccp_compute_assignment_table(uint32_t count, wccp_dsg_appliance *entries, 
                                    uint32_t seed) {
     if (count == 0)
         return;
-    const owned_words all(work_array<be32>(count));
-    const owned_weights all_weights(work_array<uint16_t>(count));
-    const owned_words active(work_array<be32>(count));
-    const owned_weights active_weights(work_array<uint16_t>(count));
+    const owned_address_array all(allocate_work_array<be32>(count));
+    const owned_weight_array all_weights(allocate_work_array<uint16_t>(count));
+    const owned_address_array active(allocate_work_array<be32>(count));
+    const owned_weight_array active_weights(allocate_work_array<uint16_t>(count));
     if (!all.pointer || !all_weights.pointer || !active.pointer || !active_weights.pointer) {
         QV_LOG(LC_LOG_ERR, "Computing assignment table failed: out of memory");
         return;
@@ -229,7 +241,7 @@ void wccp_compute_assignment_table(uint32_t count, wccp_dsg_appliance *entries, 
         for (uint32_t i = 0; i < count; i++) {
             if (entries[i].up)
                 continue;
-            const slot_run run = find_run(table, slots, entries[i].ipa);
+            const slot_run run = find_slot_run(table, slots, entries[i].ipa);
             compute_u8_assignment_array(active_count, active.pointer, active_weights.pointer, run.length,
                                         table + run.begin);
         }
@@ -242,7 +254,7 @@ void compute_u8_assignment_array(uint32_t count, const be32 *identifiers, const 
                                  uint32_t slots, be32 *table) {
     if (count == 0)
         return;
-    const owned_numbers shares(work_array<uint32_t>(count));
+    const owned_number_array shares(allocate_work_array<uint32_t>(count));
     if (!shares.pointer) {
         QV_LOG(LC_LOG_ERR, "WCCP assignment array calculation failed: out of memory");
         return;

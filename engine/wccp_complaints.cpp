@@ -1,21 +1,27 @@
 #include "engine/wccp_complaints.h"
 
-static constexpr uint32_t BURST = 200;
-static constexpr uint32_t LINES_PER_SECOND = 20;
-static constexpr uint32_t LONGEST_SILENCE = 60; // seconds of a flood without a word of what it suppresses
+namespace {
 
-static wccp_interface *current; // engine lock
+constexpr uint32_t BURST = 200;
+constexpr uint32_t LINES_PER_SECOND = 20;
+constexpr uint32_t REPORT_PERIOD = 60; // seconds of a flood without a word of what it suppresses
+
+wccp_interface *current_interface; // engine lock
+
+} // namespace
 
 wccp_complaint_scope::wccp_complaint_scope(wccp_interface *interface) {
-    current = interface;
+    current_interface = interface;
 }
 
 wccp_complaint_scope::~wccp_complaint_scope() {
-    current = nullptr;
+    current_interface = nullptr;
 }
 
+namespace {
+
 // One line, if the budget has it.
-static bool spend(wccp_complaint_budget *budget) {
+bool take_from_budget(wccp_complaint_budget *budget) {
     const uint64_t refill = uint64_t{LINES_PER_SECOND} * (wccp_g.seconds - budget->refill_time);
     budget->refill_time = wccp_g.seconds;
     budget->spent = refill < budget->spent ? budget->spent - static_cast<uint32_t>(refill) : 0;
@@ -25,11 +31,13 @@ static bool spend(wccp_complaint_budget *budget) {
     return true;
 }
 
+} // namespace
+
 bool wccp_may_complain() {
-    if (!current)
+    if (!current_interface)
         return true;
-    wccp_complaint_budget *budget = &current->complaints;
-    if (spend(budget))
+    wccp_complaint_budget *budget = &current_interface->complaints;
+    if (take_from_budget(budget))
         return true;
     if (budget->suppressed++ == 0)
         budget->suppressed_since = wccp_g.seconds;
@@ -41,10 +49,9 @@ void wccp_report_suppressed_complaints() {
         wccp_complaint_budget *budget = &wccp_g.interfaces[i].complaints;
         const bool goes_on = budget->suppressed != budget->suppressed_at_tick;
         budget->suppressed_at_tick = budget->suppressed;
-        if (budget->suppressed == 0 ||
-            (goes_on && wccp_g.seconds - budget->suppressed_since < LONGEST_SILENCE))
+        if (budget->suppressed == 0 || (goes_on && wccp_g.seconds - budget->suppressed_since < REPORT_PERIOD))
             continue;
-        (void)spend(budget); // a tick refills it
+        (void)take_from_budget(budget); // a tick refills it
         QV_LOG(LC_LOG_ERR, "WCCP: %s: %u more lines about received packets were suppressed.",
                wccp_g.interfaces[i].name, budget->suppressed);
         budget->suppressed = budget->suppressed_at_tick = 0;

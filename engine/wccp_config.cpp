@@ -108,7 +108,7 @@ void start_timer(wccp_timer *timer, uint32_t period, uint32_t countdown) {
 }
 
 // What a group has agreed with its routers and computed for them.
-void forget_agreement(wccp_service_group *group) {
+void clear_agreement(wccp_service_group *group) {
     group->designated = 0;
     group->fwd_method = WCCP_METHOD_NONE;
     group->assign_method = WCCP_ASSIGN_NONE;
@@ -120,7 +120,7 @@ void forget_agreement(wccp_service_group *group) {
 }
 
 template <typename T>
-void free_list(T **head, uint32_t *count) {
+void free_records(T **head, uint32_t *count) {
     while (T *record = *head) {
         list_unlink(record);
         wccp_free(record);
@@ -134,12 +134,12 @@ void free_group(wccp_service_group *group) {
 }
 
 // For configuration, which may add hundreds of groups in one second: one attempt is enough then.
-void recover_for_configuration(wccp_interface *interface) {
+void recover_once_per_second(wccp_interface *interface) {
     if (interface->network_tried != wccp_g.seconds)
         wccp_recover_interface(interface);
 }
 
-bool is_needed(const wccp_interface *interface) {
+bool interface_is_needed(const wccp_interface *interface) {
     if (!wccp_if_is_ready(interface))
         return false;
     for (const wccp_service_group *group = interface->groups; group; group = group->if_next)
@@ -154,7 +154,7 @@ wccp_interface *find_or_add_interface(const wccp_grp_config *config) {
     const wccp_engine_lock lock;
     wccp_interface *interface = wccp_if_find_interface(name);
     if (interface)
-        recover_for_configuration(interface);
+        recover_once_per_second(interface);
     else
         interface = wccp_if_add_interface(name);
     if (!interface)
@@ -234,7 +234,7 @@ int wccp_add_group(const wccp_grp_config *config) {
 void wccp_start_service_group(wccp_service_group *group) {
     group->assign_timer.active = 0;
     wccp_flush_group_lists(group);
-    forget_agreement(group);
+    clear_agreement(group);
     wccp_forget_all_reasons(group);
     group->start_time = wccp_g.seconds;
     wccp_appliance_state_init(group);
@@ -271,7 +271,7 @@ void wccp_stop_service_group(wccp_service_group *group) {
     group->assign_timer.active = 0;
     group->monitor_timer.active = 0;
     wccp_flush_group_lists(group);
-    forget_agreement(group);
+    clear_agreement(group);
     wccp_forget_all_reasons(group);
     wccp_note_network(group);
     group->start_time = wccp_g.seconds;
@@ -285,17 +285,17 @@ int wccp_flush_group_lists(wccp_service_group *group) {
             router->flags &= ~WCCP_RTR_HAS_TUNNEL;
             wccp_del_tunnel(group->id, group->appliance_ipa, router->router_id, 0);
         }
-    free_list(&group->sending_routers, &group->sending_router_count);
-    free_list(&group->appliance_view, &group->appliance_view_count);
-    free_list(&group->router_view, &group->router_view_count);
-    free_list(&group->removal_replies, &group->removal_reply_count);
+    free_records(&group->sending_routers, &group->sending_router_count);
+    free_records(&group->appliance_view, &group->appliance_view_count);
+    free_records(&group->router_view, &group->router_view_count);
+    free_records(&group->removal_replies, &group->removal_reply_count);
     return 0;
 }
 
 namespace {
 
 // Takes the group out of the engine and frees it. Lock held.
-void delete_group(wccp_service_group *group, bool clear_alarms) {
+void remove_group(wccp_service_group *group, bool clear_alarms) {
     list_unlink(group);
     wccp_g.groups[group->id] = nullptr;
     wccp_notify_service_group_shutdown(group);
@@ -317,7 +317,7 @@ int wccp_del_group(int id) {
         QV_LOG(LC_LOG_ERR, "WCCP:wccp_del_group: Group %d does not exists", id);
         return 1;
     }
-    delete_group(group, true);
+    remove_group(group, true);
     return 0;
 }
 
@@ -325,7 +325,7 @@ int wccp_del_all_groups() {
     const wccp_engine_lock lock;
     for (wccp_service_group *group : wccp_g.groups)
         if (group)
-            delete_group(group, false);
+            remove_group(group, false);
     return 0;
 }
 
@@ -337,7 +337,7 @@ int wccp_enable_group(wccp_service_group *group, const wccp_grp_config *) {
     if (group->admin_state == WCCP_ADMIN_UP)
         return 0;
     if (group->interfaces[0])
-        recover_for_configuration(group->interfaces[0]);
+        recover_once_per_second(group->interfaces[0]);
     group->admin_state = WCCP_ADMIN_UP;
     wccp_start_service_group(group);
     return 0;
@@ -409,11 +409,11 @@ struct modify_row {
     int result_without_group;
     const char *message_without_group;
 };
-bool wants_up(const wccp_grp_config *config) {
+bool enables_group(const wccp_grp_config *config) {
     return config->admin == WCCP_ADMIN_UP;
 }
 const modify_row modify_rows[] = {
-    {WCCP_CFG_ADMIN, wants_up, wccp_enable_group, 0, "WCCP GRP %d enabled failed. cannot find group."},
+    {WCCP_CFG_ADMIN, enables_group, wccp_enable_group, 0, "WCCP GRP %d enabled failed. cannot find group."},
     {WCCP_CFG_ADMIN, nullptr, wccp_disable_group, 0, "WCCP GRP %d disable failed. cannot find group."},
     {WCCP_CFG_WEIGHT, nullptr, wccp_set_grp_weight, 1,
      "WCCP GRP %d setting weight failed. cannot find group."},
@@ -501,7 +501,8 @@ void wccp_recover_interfaces_due() {
     for (uint32_t i = 0; i < wccp_g.if_count; i++) {
         wccp_interface *interface = &wccp_g.interfaces[i];
         if (interface->network_flaws != 0 &&
-            wccp_g.seconds - interface->network_tried >= NETWORK_RETRY_SECONDS && is_needed(interface))
+            wccp_g.seconds - interface->network_tried >= NETWORK_RETRY_SECONDS &&
+            interface_is_needed(interface))
             wccp_recover_interface(interface);
     }
 }

@@ -7,18 +7,19 @@
 #include "engine/wccp_debug_utils.h"
 #include "engine/wccp_utils.h"
 
-static const char *const method_words[] = {"not set", "hash", "mask", "either"};
+namespace {
 
-static const char *method_word(uint32_t method, uint32_t known) {
+const char *const method_words[] = {"not set", "hash", "mask", "either"};
+
+const char *name_assign_method(uint32_t method, uint32_t known) {
     return method < known ? method_words[method] : "unknown";
 }
 
-static uint32_t percent(uint32_t part, uint32_t whole) {
+uint32_t compute_percent(uint32_t part, uint32_t whole) {
     return whole ? part * 100 / whole : 0;
 }
 
-static int wccp_print_service_grp_assignment_global(const wccp_service_group *group,
-                                                    csys_display_buf *buffer) {
+int wccp_print_service_grp_assignment_global(const wccp_service_group *group, csys_display_buf *buffer) {
     static const char *const hash_words[] = {"src-ip ", "dst-ip ", "src-port ", "dst-port "};
     wccp_piece piece = wccp_assignment_piece(buffer);
     wccp_piece_add(&piece, "\n\t%-26s\n", "Assignment");
@@ -32,14 +33,14 @@ static int wccp_print_service_grp_assignment_global(const wccp_service_group *gr
     wccp_piece_add(&piece, "\n\t%-26s : dst-ip: 0x%08x, dst-port: 0x%04x\n", "", group->mask_dst_ip,
                    group->mask_dst_port);
     wccp_piece_add(&piece, "\t%-26s : %s\n", "Configured assign. method",
-                   method_word(group->cfg_assign_method, 4));
+                   name_assign_method(group->cfg_assign_method, 4));
     wccp_piece_add(&piece, "\t%-26s : %s\n", "Negotiated assign. method",
-                   method_word(group->assign_method, 3));
+                   name_assign_method(group->assign_method, 3));
     WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
     return 0;
 }
 
-static void put_bucket_set(wccp_piece *piece, const wccp_service_group *group, be32 appliance) {
+void put_bucket_set(wccp_piece *piece, const wccp_service_group *group, be32 appliance) {
     uint32_t words[8] = {};
     for (uint32_t i = 0; i < WCCP_MAX_BUCKETS; i++)
         if (group->bucket_ipa[i] == appliance)
@@ -49,7 +50,7 @@ static void put_bucket_set(wccp_piece *piece, const wccp_service_group *group, b
                        words[top - 2], words[top - 3]);
 }
 
-static int print_mask_values(const wccp_service_group *group, wccp_piece *piece) {
+int print_mask_values(const wccp_service_group *group, wccp_piece *piece) {
     const wccp_mask *mask = &group->mask_in_use;
     wccp_piece_add(piece, "\t%-26s\n", "Designator mask assignment");
     wccp_piece_add(piece, "\t%10s : %-10s %-10s %-8s %-8s\n", "Mask", "src-ip", "dst-ip", "src-port",
@@ -71,8 +72,7 @@ static int print_mask_values(const wccp_service_group *group, wccp_piece *piece)
     return 0;
 }
 
-static int wccp_print_service_grp_assignment_designator(const wccp_service_group *group,
-                                                        csys_display_buf *buffer) {
+int wccp_print_service_grp_assignment_designator(const wccp_service_group *group, csys_display_buf *buffer) {
     wccp_piece piece = wccp_assignment_piece(buffer);
     wccp_piece_add(&piece, "\n\t%-26s", "Designator allocation");
     if (group->designated != 1) {
@@ -88,7 +88,7 @@ static int wccp_print_service_grp_assignment_designator(const wccp_service_group
         wccp_piece_add(&piece, "\t%-26s : %s\n", "Appliance ip", addr_text(entry->ipa).s);
         wccp_piece_add(&piece, "\t%-26s : %d\n", "Weight", entry->weight);
         wccp_piece_add(&piece, "\t%-26s : %d %% \n", "Hash/mask allotment",
-                       static_cast<int>(percent(entry->assigned, group->bucket_count)));
+                       static_cast<int>(compute_percent(entry->assigned, group->bucket_count)));
         if (group->assign_method == WCCP_ASSIGN_HASH)
             put_bucket_set(&piece, group, entry->ipa);
         wccp_piece_add(&piece, "\n");
@@ -97,19 +97,19 @@ static int wccp_print_service_grp_assignment_designator(const wccp_service_group
     return group->assign_method == WCCP_ASSIGN_MASK ? print_mask_values(group, &piece) : 0;
 }
 
-static void put_words(wccp_piece *piece, const uint32_t *words) {
+void put_words(wccp_piece *piece, const uint32_t *words) {
     wccp_piece_add(piece, "0x%08x %08x %08x %08x\n", words[0], words[1], words[2], words[3]);
 }
 
-static int wccp_print_service_grp_assignment_router(const wccp_service_group *group,
-                                                    csys_display_buf *buffer) {
+int wccp_print_service_grp_assignment_router(const wccp_service_group *group, csys_display_buf *buffer) {
     wccp_piece piece = wccp_assignment_piece(buffer);
     wccp_piece_add(&piece, "\t%-26s\n", "Received router allocation");
     WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
         for (uint32_t i = 0; i < router->view_appliance_count; i++) {
             const wccp_rtr_view_appliance *entry = &router->view_appliances[i];
-            const int share = static_cast<int>(percent(entry->buckets_assigned, entry->buckets_total));
+            const int share =
+                static_cast<int>(compute_percent(entry->buckets_assigned, entry->buckets_total));
             wccp_piece_add(&piece, "\t%-26s : %s\n", "Router id", addr_text(router->router_id).s);
             wccp_piece_add(&piece, "\t%-26s : %s\n", "Appliance ip", addr_text(entry->ipa).s);
             wccp_piece_add(&piece, "\t%-26s : %d\n", "Weight", entry->weight);
@@ -132,6 +132,8 @@ static int wccp_print_service_grp_assignment_router(const wccp_service_group *gr
     WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
     return 0;
 }
+
+} // namespace
 
 int wccp_print_service_grp_assignment_details_by_grp_ptr(wccp_service_group *group,
                                                          csys_display_buf *buffer) {

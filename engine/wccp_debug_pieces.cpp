@@ -5,8 +5,12 @@
 #include <cstdarg>
 #include <cstdio>
 
-static char group_scratch[1024];
-static char assignment_scratch[6399];
+namespace {
+
+char group_scratch[1024];
+char assignment_scratch[6399];
+
+} // namespace
 
 wccp_piece wccp_group_piece(csys_display_buf *buffer) {
     return {buffer, group_scratch, sizeof group_scratch, 0};

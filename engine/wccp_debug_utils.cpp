@@ -15,24 +15,28 @@
 #include "engine/wccp_debug_pieces.h"
 #include "engine/wccp_utils.h"
 
-static const char *up_or_down(uint32_t up) {
+namespace {
+
+const char *name_link_state(uint32_t up) {
     return up ? "up" : "down";
 }
-static const char *ok_or_no(bool ok) {
+const char *name_readiness(bool ok) {
     return ok ? "ok" : "no";
 }
-static void put_uptime(wccp_piece *piece, uint32_t since) {
+void put_uptime(wccp_piece *piece, uint32_t since) {
     char text[64] = "";
     wccp_seconds_to_str(wccp_g.seconds - since, text, sizeof text);
     wccp_piece_add(piece, "%s", text);
 }
-static void put_countdown(wccp_piece *piece, const wccp_timer *timer) {
+void put_countdown(wccp_piece *piece, const wccp_timer *timer) {
     wccp_piece_add(piece, "%u (seconds)", timer->active == 1 ? timer->countdown : 0);
 }
-static void put_swapped_words(wccp_piece *piece, const uint32_t *words) {
+void put_swapped_words(wccp_piece *piece, const uint32_t *words) {
     wccp_piece_add(piece, "0x%08x %08x %08x %08x", __builtin_bswap32(words[0]), __builtin_bswap32(words[1]),
                    __builtin_bswap32(words[2]), __builtin_bswap32(words[3]));
 }
+
+} // namespace
 
 using group_row = wccp_dump_row<wccp_service_group>;
 using router_row = wccp_dump_row<wccp_sending_router>;
@@ -43,7 +47,9 @@ using router_row = wccp_dump_row<wccp_sending_router>;
         label, [](wccp_piece *p, const record *r) { wccp_piece_add(p, format, r->field); }                   \
     }
 
-static const wccp_dump_row<wccp_global> global_rows[] = {
+namespace {
+
+const wccp_dump_row<wccp_global> global_rows[] = {
     NUMBER_ROW(wccp_global, "WCCP # of groups", "%d", group_count),
     NUMBER_ROW(wccp_global, "WCCP multicast TTL", "%d", mcast_ttl),
     NUMBER_ROW(wccp_global, "WCCP stat num allocs", "%d", stat_allocs.load()),
@@ -52,7 +58,7 @@ static const wccp_dump_row<wccp_global> global_rows[] = {
     NUMBER_ROW(wccp_global, "WCCP # err rx total failures", "%d", rx_failures),
 };
 
-static const group_row stats_rows[] = {
+const group_row stats_rows[] = {
     NUMBER_ROW(wccp_service_group, "WCCP # rx icus", "%u", rx_icus),
     NUMBER_ROW(wccp_service_group, "WCCP # rx removal queries", "%u", rx_removal_queries),
     NUMBER_ROW(wccp_service_group, "WCCP # tx here_i_am", "%u", tx_here_i_am),
@@ -68,7 +74,7 @@ static const group_row stats_rows[] = {
     NUMBER_ROW(wccp_service_group, "WCCP # rx err authen. failures", "%u", rx_auth_failures),
 };
 
-static const char *dump_state_name(uint32_t state_flags) {
+const char *dump_state_name(uint32_t state_flags) {
     switch (state_flags & WCCP_STATE_MASK) {
     case 0:
         return "none";
@@ -83,13 +89,13 @@ static const char *dump_state_name(uint32_t state_flags) {
     }
 }
 
-static void put_password(wccp_piece *p, const wccp_service_group *g) {
+void put_password(wccp_piece *p, const wccp_service_group *g) {
     wccp_piece_add(p, "%.*s ", static_cast<int>(strnlen(g->password, sizeof g->password)), g->password);
     for (const char byte : g->password)
         wccp_piece_add(p, "0x%x, ", static_cast<unsigned>(static_cast<uint8_t>(byte)));
 }
 
-static void put_state_flags(wccp_piece *p, const wccp_service_group *g) {
+void put_state_flags(wccp_piece *p, const wccp_service_group *g) {
     static const struct {
         uint32_t flag;
         const char *name;
@@ -108,7 +114,7 @@ static void put_state_flags(wccp_piece *p, const wccp_service_group *g) {
     wccp_piece_add(p, " }");
 }
 
-static void put_raised_alarms(wccp_piece *p, const wccp_service_group *g) {
+void put_raised_alarms(wccp_piece *p, const wccp_service_group *g) {
     if (g->raised_alarms == 0) {
         wccp_piece_add(p, "none");
         return;
@@ -120,7 +126,7 @@ static void put_raised_alarms(wccp_piece *p, const wccp_service_group *g) {
         wccp_piece_add(p, "assign tbl mismatch");
 }
 
-static const group_row configured_rows[] = {
+const group_row configured_rows[] = {
     {"WCCP appliance ipa",
      [](wccp_piece *p, const wccp_service_group *g) {
          wccp_piece_add(p, "%s", addr_text(g->appliance_ipa).s);
@@ -149,13 +155,11 @@ static const group_row configured_rows[] = {
 };
 
 // One interface of a group, as its three rows take it.
-namespace {
 struct dump_interface {
     int number;
     const wccp_interface *interface;
 };
-} // namespace
-static const wccp_dump_row<dump_interface> interface_rows[] = {
+const wccp_dump_row<dump_interface> interface_rows[] = {
     {"WCCP interfaces",
      [](wccp_piece *p, const dump_interface *i) {
          wccp_piece_add(p, "# %d %.*s", i->number, static_cast<int>(sizeof i->interface->name),
@@ -163,17 +167,18 @@ static const wccp_dump_row<dump_interface> interface_rows[] = {
      }},
     {"WCCP interface ipa and link",
      [](wccp_piece *p, const dump_interface *i) {
-         wccp_piece_add(p, "%s %s ", addr_text(i->interface->ipa).s, up_or_down(i->interface->link_up));
+         wccp_piece_add(p, "%s %s ", addr_text(i->interface->ipa).s, name_link_state(i->interface->link_up));
      }},
     {"WCCP interface ready flags",
      [](wccp_piece *p, const dump_interface *i) {
          const uint32_t flags = i->interface->ready_flags;
-         wccp_piece_add(p, "ipa: %s link: %s track intf: %s ", ok_or_no(flags & WCCP_IPA_READY),
-                        ok_or_no(flags & WCCP_LINK_READY), ok_or_no(wccp_if_is_ready(wccp_g.primary_if)));
+         wccp_piece_add(p, "ipa: %s link: %s track intf: %s ", name_readiness(flags & WCCP_IPA_READY),
+                        name_readiness(flags & WCCP_LINK_READY),
+                        name_readiness(wccp_if_is_ready(wccp_g.primary_if)));
      }},
 };
 
-static const group_row state_rows[] = {
+const group_row state_rows[] = {
     {"WCCP config fwd, assign, return",
      [](wccp_piece *p, const wccp_service_group *g) {
          wccp_piece_add(p, "%s, %s, %s", wccp_method_name(g->cfg_fwd_method),
@@ -198,7 +203,7 @@ static const group_row state_rows[] = {
     NUMBER_ROW(wccp_service_group, "WCCP ICU sending routers", "%u", sending_router_count),
 };
 
-static const router_row router_rows[] = {
+const router_row router_rows[] = {
     {"WCCP router id (src ip)",
      [](wccp_piece *p, const wccp_sending_router *r) {
          wccp_piece_add(p, "%s (%s)", addr_text(r->router_id).s, addr_text(r->src_ipa).s);
@@ -217,14 +222,14 @@ static const router_row router_rows[] = {
     {"WCCP current state up time",
      [](wccp_piece *p, const wccp_sending_router *r) { put_uptime(p, r->state_time); }},
 };
-static const router_row router_capability_rows[] = {
+const router_row router_capability_rows[] = {
     {"WCCP router fwd, assign, return",
      [](wccp_piece *p, const wccp_sending_router *r) {
          wccp_piece_add(p, "%s, %s, %s", wccp_method_name(r->cap_fwd), wccp_assign_method_name(r->cap_assign),
                         wccp_method_name(r->cap_ret));
      }},
 };
-static const wccp_dump_row<wccp_rtr_view_appliance> rx_assignment_rows[] = {
+const wccp_dump_row<wccp_rtr_view_appliance> rx_assignment_rows[] = {
     {"WCCP appliance id",
      [](wccp_piece *p, const wccp_rtr_view_appliance *a) { wccp_piece_add(p, "%s", addr_text(a->ipa).s); }},
     {"WCCP rx buckets assigned/total",
@@ -236,44 +241,44 @@ static const wccp_dump_row<wccp_rtr_view_appliance> rx_assignment_rows[] = {
     {"WCCP rx bucket bits 128-255",
      [](wccp_piece *p, const wccp_rtr_view_appliance *a) { put_swapped_words(p, a->bucket_bits + 4); }},
 };
-static const router_row view_router_count_rows[] = {
+const router_row view_router_count_rows[] = {
     NUMBER_ROW(wccp_sending_router, "WCCP # routers in view", "%u", view_router_count),
 };
-static const wccp_dump_row<wccp_rtr_view_router> view_router_rows[] = {
+const wccp_dump_row<wccp_rtr_view_router> view_router_rows[] = {
     {"WCCP view router id/flags",
      [](wccp_piece *p, const wccp_rtr_view_router *v) {
          wccp_piece_add(p, "%s 0x%x", addr_text(v->ipa).s, v->flags);
      }},
 };
-static const router_row view_appliance_count_rows[] = {
+const router_row view_appliance_count_rows[] = {
     NUMBER_ROW(wccp_sending_router, "WCCP # appliances in view", "%u", view_appliance_count),
 };
-static const wccp_dump_row<wccp_rtr_view_appliance> view_appliance_rows[] = {
+const wccp_dump_row<wccp_rtr_view_appliance> view_appliance_rows[] = {
     {"WCCP view app.id/weight/flags",
      [](wccp_piece *p, const wccp_rtr_view_appliance *v) {
          wccp_piece_add(p, "%s %u 0x%x", addr_text(v->ipa).s, v->weight, v->flags);
      }},
 };
 
-static const group_row appliance_count_rows[] = {
+const group_row appliance_count_rows[] = {
     NUMBER_ROW(wccp_service_group, "WCCP # of appliances in view", "%u", appliance_view_count),
 };
-static const wccp_dump_row<wccp_view_appliance> appliance_rows[] = {
+const wccp_dump_row<wccp_view_appliance> appliance_rows[] = {
     {"WCCP appliance (sorted w+ip)",
      [](wccp_piece *p, const wccp_view_appliance *v) {
          wccp_piece_add(p, "%s wgt = %u ref = %u", addr_text(v->ipa).s, v->weight, v->ref_count);
      }},
 };
-static const group_row router_count_rows[] = {
+const group_row router_count_rows[] = {
     NUMBER_ROW(wccp_service_group, "WCCP # of routers in view", "%u", router_view_count),
 };
-static const wccp_dump_row<wccp_view_router> router_view_rows[] = {
+const wccp_dump_row<wccp_view_router> router_view_rows[] = {
     {"WCCP router view ipa/refcnt",
      [](wccp_piece *p, const wccp_view_router *v) {
          wccp_piece_add(p, "%s %u", addr_text(v->ipa).s, v->ref_count);
      }},
 };
-static const group_row alarm_rows[] = {
+const group_row alarm_rows[] = {
     {"WCCP raised alarms", put_raised_alarms},
     {"WCCP timer router-down alarm ",
      [](wccp_piece *p, const wccp_service_group *g) { put_countdown(p, &g->router_alarm_timer); }},
@@ -281,9 +286,13 @@ static const group_row alarm_rows[] = {
      [](wccp_piece *p, const wccp_service_group *g) { put_countdown(p, &g->assign_alarm_timer); }},
 };
 
+} // namespace
+
 int32_t wccp_dump_failure_level = LC_LOG_ERR;
 
-static int wccp_print_global_info(csys_display_buf *buffer) {
+namespace {
+
+int wccp_print_global_info(csys_display_buf *buffer) {
     wccp_piece piece = wccp_group_piece(buffer);
     wccp_piece_add(&piece, "\n    WCCP GLOBAL INFO\n\n");
     if (wccp_piece_flush(&piece) || wccp_print_rows(&piece, global_rows, &wccp_g)) {
@@ -293,7 +302,7 @@ static int wccp_print_global_info(csys_display_buf *buffer) {
     return 0;
 }
 
-static int wccp_print_service_group_stats(wccp_service_group *group, csys_display_buf *buffer) {
+int wccp_print_service_group_stats(wccp_service_group *group, csys_display_buf *buffer) {
     wccp_piece piece = wccp_group_piece(buffer);
     wccp_piece_add(&piece, "\n    ********* WCCP GROUP ID %d STATS ****\n", group->id);
     WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
@@ -301,8 +310,7 @@ static int wccp_print_service_group_stats(wccp_service_group *group, csys_displa
     return 0;
 }
 
-static int print_sending_router_rows(const wccp_sending_router *router, uint32_t number,
-                                     csys_display_buf *buffer) {
+int print_sending_router_rows(const wccp_sending_router *router, uint32_t number, csys_display_buf *buffer) {
     wccp_piece piece = wccp_group_piece(buffer);
     wccp_piece_add(&piece, "    %-32s : # %d\n", "***** WCCP ICU sending router **",
                    static_cast<int>(number));
@@ -324,8 +332,8 @@ static int print_sending_router_rows(const wccp_sending_router *router, uint32_t
     return 0;
 }
 
-static int wccp_print_icu_sending_router_info(const wccp_sending_router *router, uint32_t number,
-                                              csys_display_buf *buffer) {
+int wccp_print_icu_sending_router_info(const wccp_sending_router *router, uint32_t number,
+                                       csys_display_buf *buffer) {
     const int status = print_sending_router_rows(router, number, buffer);
     if (status != 0)
         QV_LOG(wccp_dump_failure_level, "WCCP: %s failed. length (%u) buf len (%u)",
@@ -334,7 +342,7 @@ static int wccp_print_icu_sending_router_info(const wccp_sending_router *router,
     return status;
 }
 
-static int wccp_print_service_group(wccp_service_group *group, csys_display_buf *buffer) {
+int wccp_print_service_group(wccp_service_group *group, csys_display_buf *buffer) {
     wccp_piece piece = wccp_group_piece(buffer);
     WCCP_BAIL_ON_ZERO(wccp_print_rows(&piece, configured_rows, group));
     for (int i = 0; i < group->if_count; i++) {
@@ -372,9 +380,8 @@ static int wccp_print_service_group(wccp_service_group *group, csys_display_buf 
     return 0;
 }
 
-static int append_text(csys_display_buf *buffer, const char *format, ...)
-    __attribute__((format(printf, 2, 3)));
-static int append_text(csys_display_buf *buffer, const char *format, ...) {
+int append_formatted(csys_display_buf *buffer, const char *format, ...) __attribute__((format(printf, 2, 3)));
+int append_formatted(csys_display_buf *buffer, const char *format, ...) {
     char text[128];
     va_list arguments;
     va_start(arguments, format);
@@ -383,7 +390,7 @@ static int append_text(csys_display_buf *buffer, const char *format, ...) {
     return csys_append_to_safe_display_buf(buffer, text) == 0;
 }
 
-static int append_closing_line(csys_display_buf *buffer) {
+int append_closing_line(csys_display_buf *buffer) {
     char text[96];
     snprintf(text, sizeof text, "    (debug buffer: used %u max len %u)\n",
              csys_display_buf_bytes_used(buffer), csys_display_buf_bytes_max(buffer));
@@ -392,10 +399,12 @@ static int append_closing_line(csys_display_buf *buffer) {
 }
 
 // What went wrong in a part of an entry point, in the words of that entry point.
-static int part_failed(const char *words) {
+int log_failed_part(const char *words) {
     QV_LOG(wccp_dump_failure_level, "WCCP: %s failed.", words);
     return 1;
 }
+
+} // namespace
 
 int wccp_print_global(csys_display_buf *buffer) {
     wccp_engine_lock lock;
@@ -409,26 +418,31 @@ int wccp_print_global(csys_display_buf *buffer) {
     return append_closing_line(buffer);
 }
 
+namespace {
+
 // One group of the dump of all.
-static int print_one_of_all(wccp_service_group *group, csys_display_buf *buffer) {
+int print_one_of_all(wccp_service_group *group, csys_display_buf *buffer) {
     const int id = group->id;
-    WCCP_BAIL_ON_ZERO(append_text(buffer, "\n\n************** WCCP GROUP ID %d START ************\n", id));
+    WCCP_BAIL_ON_ZERO(
+        append_formatted(buffer, "\n\n************** WCCP GROUP ID %d START ************\n", id));
     if (wccp_print_service_group(group, buffer))
-        return part_failed("printing service group");
-    WCCP_BAIL_ON_ZERO(append_text(buffer, "\n    ******* WCCP GROUP %d ASSIGNMENT INFO ******\n", id));
+        return log_failed_part("printing service group");
+    WCCP_BAIL_ON_ZERO(append_formatted(buffer, "\n    ******* WCCP GROUP %d ASSIGNMENT INFO ******\n", id));
     if (wccp_print_service_grp_assignment_details_by_grp_ptr(group, buffer))
-        return part_failed("show assignment failed");
+        return log_failed_part("show assignment failed");
     if (wccp_print_service_group_stats(group, buffer))
-        return part_failed("printing service group stats");
-    WCCP_BAIL_ON_ZERO(append_text(buffer, "************** WCCP GROUP ID %d END **************\n", id));
+        return log_failed_part("printing service group stats");
+    WCCP_BAIL_ON_ZERO(append_formatted(buffer, "************** WCCP GROUP ID %d END **************\n", id));
     return 0;
 }
+
+} // namespace
 
 int wccp_print_all_wccp_info(csys_display_buf *buffer) {
     {
         wccp_engine_lock lock;
         if (wccp_print_global_info(buffer))
-            return part_failed("printing global info");
+            return log_failed_part("printing global info");
         for (wccp_service_group *group = wccp_g.group_list; group; group = group->next) {
             const int status = print_one_of_all(group, buffer);
             if (status != 0) {
@@ -446,18 +460,18 @@ int wccp_print_service_grp(csys_display_buf *buffer, int id) {
     wccp_engine_lock lock;
     wccp_service_group *group = wccp_find_group(id);
     if (!group) {
-        (void)append_text(buffer, "\n    group %d does not exist!\n", id);
+        (void)append_formatted(buffer, "\n    group %d does not exist!\n", id);
         return 1;
     }
-    WCCP_BAIL_ON_ZERO(append_text(buffer, "\n*******   WCCP GROUP %d INFO START **********\n", id));
+    WCCP_BAIL_ON_ZERO(append_formatted(buffer, "\n*******   WCCP GROUP %d INFO START **********\n", id));
     if (wccp_print_service_group(group, buffer))
-        return part_failed("print service group failed");
-    WCCP_BAIL_ON_ZERO(append_text(buffer, "    ******* WCCP GROUP %d ASSIGNMENT INFO ******\n", id));
+        return log_failed_part("print service group failed");
+    WCCP_BAIL_ON_ZERO(append_formatted(buffer, "    ******* WCCP GROUP %d ASSIGNMENT INFO ******\n", id));
     if (wccp_print_service_grp_assignment_details_by_grp_ptr(group, buffer))
-        return part_failed("print service group assignment failed");
+        return log_failed_part("print service group assignment failed");
     if (wccp_print_service_group_stats(group, buffer))
-        return part_failed("print service group stats failed");
-    WCCP_BAIL_ON_ZERO(append_text(buffer, "\n*******   WCCP GROUP %d INFO END **********\n", id));
+        return log_failed_part("print service group stats failed");
+    WCCP_BAIL_ON_ZERO(append_formatted(buffer, "\n*******   WCCP GROUP %d INFO END **********\n", id));
     return append_closing_line(buffer);
 }
 
@@ -471,6 +485,6 @@ int wccp_print_service_grp_assignment_details(int id, csys_display_buf *buffer) 
         return 1;
     }
     if (wccp_print_service_grp_assignment_details_by_grp_ptr(group, buffer))
-        return part_failed("show assignment failed");
+        return log_failed_part("show assignment failed");
     return 0;
 }

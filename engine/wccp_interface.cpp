@@ -13,7 +13,7 @@
 
 namespace {
 
-uint32_t interface_limit() {
+uint32_t get_interface_limit() {
     return std::min(qv_max_interfaces(), WCCP_MAX_INTERFACES);
 }
 
@@ -42,7 +42,7 @@ wccp_interface *wccp_if_add_interface(const char *name) {
         QV_LOG(LC_LOG_NOTICE, "WCCP: interface add failed: %s exists", known->name);
         return known;
     }
-    if (wccp_g.if_count >= interface_limit()) {
+    if (wccp_g.if_count >= get_interface_limit()) {
         QV_LOG(LC_LOG_ERR, "WCCP: interface add failed: Max Limit (%d)", wccp_g.if_count);
         return nullptr;
     }
@@ -66,7 +66,7 @@ wccp_interface *wccp_if_add_interface(const char *name) {
 int wccp_if_add_group(wccp_service_group *group, wccp_interface *interface) {
     if (!group || !interface)
         return 1;
-    if (group->if_count >= interface_limit()) {
+    if (group->if_count >= get_interface_limit()) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: max number of interfaces has reached for this group", group->id);
         return 1;
     }

@@ -107,20 +107,20 @@ void wccp_process_if_state_change(const void *argument) {
 
 namespace {
 
-void address_gone(wccp_interface *interface) {
+void handle_lost_address(wccp_interface *interface) {
     interface->ready_flags &= ~WCCP_IPA_READY;
     wccp_stop_service_groups_by_interface(interface);
     wccp_link_update_group_ipa(interface->groups, interface->ipa);
 }
 
-void address_came(wccp_interface *interface) {
+void handle_first_address(wccp_interface *interface) {
     interface->ready_flags |= WCCP_IPA_READY;
     wccp_link_update_group_ipa(interface->groups, interface->ipa);
     wccp_init_network_by_interface(interface);
     wccp_start_service_groups_by_interface(interface);
 }
 
-void address_replaced(wccp_interface *interface) {
+void handle_changed_address(wccp_interface *interface) {
     interface->ready_flags |= WCCP_IPA_READY;
     wccp_stop_service_groups_by_interface(interface);
     wccp_init_network_by_interface(interface);
@@ -129,7 +129,7 @@ void address_replaced(wccp_interface *interface) {
 }
 
 // The address is as it was; the device under it, or what the sockets lack, may not be.
-void address_confirmed(wccp_interface *interface) {
+void handle_same_address(wccp_interface *interface) {
     if (is_zero(interface->ipa))
         return;
     if (interface->device == wccp_get_device(interface->name)) {
@@ -157,7 +157,7 @@ void wccp_process_if_ipa_update(const void *argument) {
     }
     const be32 old_ipa = interface->ipa, new_ipa = wccp_get_address(interface->name);
     if (old_ipa == new_ipa) {
-        address_confirmed(interface);
+        handle_same_address(interface);
         return;
     }
     interface->ipa_change_count++;
@@ -165,14 +165,14 @@ void wccp_process_if_ipa_update(const void *argument) {
     if (is_zero(new_ipa)) {
         QV_LOG(LC_LOG_WARNING, "WCCP: Interface %s has no IP address old %s new %s", interface->name,
                addr_text(old_ipa).s, addr_text(new_ipa).s);
-        address_gone(interface);
+        handle_lost_address(interface);
         return;
     }
     const bool replaced = !is_zero(old_ipa);
     QV_LOG(replaced ? LC_LOG_NOTICE : LC_LOG_INFO, "WCCP Interface %s IP address change: %s --> %s",
            interface->name, addr_text(old_ipa).s, addr_text(new_ipa).s);
     if (replaced)
-        address_replaced(interface);
+        handle_changed_address(interface);
     else
-        address_came(interface);
+        handle_first_address(interface);
 }

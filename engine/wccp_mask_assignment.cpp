@@ -16,9 +16,11 @@
 #include "engine/wccp_slot_owners.h"
 #include "engine/wccp_utils.h"
 
-static constexpr uint32_t DEFAULT_DST_IP_MASK = 0xF00;
+namespace {
 
-static void wccp_mask_assignment_set_bit_array_element(wccp_service_group *group, const wccp_mask &bit) {
+constexpr uint32_t DEFAULT_DST_IP_MASK = 0xF00;
+
+void wccp_mask_assignment_set_bit_array_element(wccp_service_group *group, const wccp_mask &bit) {
     if (group->mask_bit_count >= WCCP_MAX_MASK_BITS) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: mask assignment: bit array: is full (%d)", group->id,
                static_cast<int>(group->mask_bit_count));
@@ -27,7 +29,7 @@ static void wccp_mask_assignment_set_bit_array_element(wccp_service_group *group
     group->mask_bit_array[group->mask_bit_count++] = bit;
 }
 
-static void build_bit_array(wccp_service_group *group) {
+void build_bit_array(wccp_service_group *group) {
     enum { DST_PORT, SRC_PORT, DST_IP, SRC_IP, FIELDS }; // the order in which bits are taken
     const wccp_mask &mask = group->mask_in_use;
     const uint32_t fields[FIELDS] = {mask.dst_port, mask.src_port, mask.dst_ip, mask.src_ip};
@@ -47,7 +49,7 @@ static void build_bit_array(wccp_service_group *group) {
 }
 
 // Each value is the one without its lowest bit, plus that bit.
-static void wccp_mask_assignment_generate_values(wccp_service_group *group) {
+void wccp_mask_assignment_generate_values(wccp_service_group *group) {
     const uint32_t count = 1u << group->mask_bit_count;
     group->mask_values[0] = {};
     for (uint32_t k = 1; k < count; k++) {
@@ -61,6 +63,8 @@ static void wccp_mask_assignment_generate_values(wccp_service_group *group) {
     }
     group->mask_value_count = count;
 }
+
+} // namespace
 
 wccp_mask wccp_mask_of_assignment(const wccp_service_group *group) {
     const wccp_mask configured = {group->mask_src_ip, group->mask_dst_ip, group->mask_src_port,

@@ -42,9 +42,10 @@
 
 namespace {
 
-constexpr int BUFFER = 16 << 20; // bytes in each direction, with the kernel's own overhead for each datagram
+constexpr int SOCKET_BUFFER_BYTES =
+    16 << 20; // bytes in each direction, with the kernel's own overhead for each datagram
 
-int bind_to(int fd, be32 address) {
+int bind_socket(int fd, be32 address) {
     const sockaddr_in local = wccp_socket_address(address);
     return bind(fd, reinterpret_cast<const sockaddr *>(&local), sizeof local);
 }
@@ -57,14 +58,15 @@ struct socket_option {
 };
 
 // As large as the kernel allows.
-void widen_buffer(int fd, int forced, int within_limits) {
-    if (setsockopt(fd, SOL_SOCKET, forced, &BUFFER, sizeof BUFFER) != 0)
-        (void)setsockopt(fd, SOL_SOCKET, within_limits, &BUFFER, sizeof BUFFER);
+void set_buffer_size(int fd, int forced, int within_limits) {
+    if (setsockopt(fd, SOL_SOCKET, forced, &SOCKET_BUFFER_BYTES, sizeof SOCKET_BUFFER_BYTES) != 0)
+        (void)setsockopt(fd, SOL_SOCKET, within_limits, &SOCKET_BUFFER_BYTES, sizeof SOCKET_BUFFER_BYTES);
 }
 
 // A datagram socket with these options, or -1; each failure has its log line, and the interface its errno.
 template <size_t Count>
-int open_socket(wccp_interface *interface, const char *open_failure, const socket_option (&options)[Count]) {
+int open_datagram_socket(wccp_interface *interface, const char *open_failure,
+                         const socket_option (&options)[Count]) {
     const int fd = socket(AF_INET, SOCK_DGRAM, 0);
     if (fd < 0) {
         interface->network_error = errno;
@@ -79,24 +81,25 @@ int open_socket(wccp_interface *interface, const char *open_failure, const socke
         close(fd);
         return -1;
     }
-    widen_buffer(fd, SO_RCVBUFFORCE, SO_RCVBUF);
-    widen_buffer(fd, SO_SNDBUFFORCE, SO_SNDBUF);
+    set_buffer_size(fd, SO_RCVBUFFORCE, SO_RCVBUF);
+    set_buffer_size(fd, SO_SNDBUFFORCE, SO_SNDBUF);
     (void)fcntl(fd, F_SETFL, O_NONBLOCK);
     return fd;
 }
 
-int open_unicast(wccp_interface *interface) {
+int open_unicast_socket(wccp_interface *interface) {
     const int on = 1, no_discovery = IP_PMTUDISC_DONT;
     const socket_option options[] = {
         {SOL_SOCKET, SO_REUSEADDR, &on, sizeof on, "WCCP: net init %s: Cannot set mcast socket option: %m"},
         {IPPROTO_IP, IP_MTU_DISCOVER, &no_discovery, sizeof no_discovery,
          "WCCP: net init %s Cannot disable path mtu discovery. %m"},
     };
-    const int fd = open_socket(interface, "WCCP: net init %s: Fail to open ucast socket. %m", options);
+    const int fd =
+        open_datagram_socket(interface, "WCCP: net init %s: Fail to open ucast socket. %m", options);
     if (fd < 0)
         return 1;
     // A socket that cannot be bound stays open; it is `ucast_bound` that permits sending.
-    const int result = bind_to(fd, interface->ipa);
+    const int result = bind_socket(fd, interface->ipa);
     if (result != 0) {
         interface->network_error = errno;
         QV_LOG(LC_LOG_ERR, "WCCP: net init: %s Cannot bind unicast UDP socket to %s:%d: %m", interface->name,
@@ -109,7 +112,7 @@ int open_unicast(wccp_interface *interface) {
     return 0;
 }
 
-int open_multicast(wccp_interface *interface) {
+int open_multicast_socket(wccp_interface *interface) {
     const int on = 1, no_discovery = IP_PMTUDISC_DONT;
     const uint8_t ttl = wccp_g.mcast_ttl, no_loop = 0;
     const socket_option options[] = {
@@ -120,7 +123,7 @@ int open_multicast(wccp_interface *interface) {
         {IPPROTO_IP, IP_MTU_DISCOVER, &no_discovery, sizeof no_discovery,
          "WCCP: net init %s mcast cannot disable path mtu discovery. %m"},
     };
-    const int fd = open_socket(interface, "WCCP: net init %s: Cannot open mc socket. %m", options);
+    const int fd = open_datagram_socket(interface, "WCCP: net init %s: Cannot open mc socket. %m", options);
     if (fd < 0)
         return 1;
     wccp_set_descriptor(&interface->mcast_fd, fd);
@@ -150,7 +153,7 @@ int start_rx_thread(wccp_interface *interface) {
     return 0;
 }
 
-ifreq request_for(const char *name) {
+ifreq make_interface_request(const char *name) {
     ifreq request = {};
     strlcpy(request.ifr_name, name, sizeof request.ifr_name);
     request.ifr_addr.sa_family = AF_INET;
@@ -190,7 +193,7 @@ int wccp_init_network_by_interface(wccp_interface *interface) {
         return 0;
     }
     interface->device = wccp_get_device(interface->name);
-    if (open_unicast(interface) || open_multicast(interface)) {
+    if (open_unicast_socket(interface) || open_multicast_socket(interface)) {
         interface->network_flaws |= WCCP_FLAW_SOCKETS;
         return 1;
     }
@@ -225,7 +228,7 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
     if (interface->mcast_fd == -1 || is_zero(interface->ipa))
         return 1;
     if (!interface->mcast_bound) {
-        if (bind_to(interface->mcast_fd, address) != 0) {
+        if (bind_socket(interface->mcast_fd, address) != 0) {
             interface->network_error = errno;
             QV_LOG(LC_LOG_ERR, "WCCP: Interface %s: Cannot bind mcast UDP socket to %s:%d. %m",
                    interface->name, addr_text(address).s, WCCP_PORT);
@@ -265,8 +268,10 @@ int wccp_config_mcast(wccp_interface *interface) {
     return 0;
 }
 
+namespace {
+
 // What keeps the interface from carrying its groups' packets, first what the others follow from.
-static wccp_reason_code find_network_fault(const wccp_interface *interface) {
+wccp_reason_code find_network_fault(const wccp_interface *interface) {
     if (!wccp_if_is_ready(interface) && wccp_get_device(interface->name) == 0)
         return WCCP_REASON_INTERFACE_MISSING;
     if (!(interface->ready_flags & WCCP_LINK_READY))
@@ -277,6 +282,8 @@ static wccp_reason_code find_network_fault(const wccp_interface *interface) {
         return interface->network_error == EADDRINUSE ? WCCP_REASON_PORT_TAKEN : WCCP_REASON_SOCKET_FAILED;
     return interface->network_flaws & WCCP_FLAW_JOIN ? WCCP_REASON_JOIN_FAILED : WCCP_REASON_NONE;
 }
+
+} // namespace
 
 void wccp_note_network(wccp_service_group *group) {
     static constexpr wccp_reason_code faults[] = {
@@ -296,7 +303,7 @@ void wccp_note_network(wccp_service_group *group) {
 }
 
 be32 wccp_get_address(const char *name) {
-    ifreq request = request_for(name);
+    ifreq request = make_interface_request(name);
     if (ioctl(g_qvif_skfd, SIOCGIFADDR, &request) != 0)
         return {};
     sockaddr_in address;
@@ -305,12 +312,12 @@ be32 wccp_get_address(const char *name) {
 }
 
 int32_t wccp_get_device(const char *name) {
-    ifreq request = request_for(name);
+    ifreq request = make_interface_request(name);
     return ioctl(g_qvif_skfd, SIOCGIFINDEX, &request) == 0 ? request.ifr_ifindex : 0;
 }
 
 uint32_t wccp_get_if_status(const char *name) {
-    ifreq request = request_for(name);
+    ifreq request = make_interface_request(name);
     if (ioctl(g_qvif_skfd, SIOCGIFFLAGS, &request) != 0) {
         QV_LOG(LC_LOG_WARNING, "WCCP: Failed to read link status %s (%m)", name);
         return 0;

@@ -8,10 +8,10 @@
 
 namespace {
 
-constexpr be32 NOBODY = {};
+constexpr be32 NO_OWNER = {};
 
 // The lowest set bits of `mask` take the lowest bits of `*inout_index`, which are used up.
-uint32_t spread(uint32_t mask, uint32_t *inout_index) {
+uint32_t spread_index_bits(uint32_t mask, uint32_t *inout_index) {
     uint32_t value = 0;
     for (; mask != 0; mask &= mask - 1, *inout_index >>= 1)
         if (*inout_index & 1)
@@ -19,15 +19,15 @@ uint32_t spread(uint32_t mask, uint32_t *inout_index) {
     return value;
 }
 
-bool is_value(const wccp_mask &mask, uint32_t index, const wccp_wire_mask &found) {
-    return to_host(found.dst_port) == spread(mask.dst_port, &index) &&
-           to_host(found.src_port) == spread(mask.src_port, &index) &&
-           to_host(found.dst_ip) == spread(mask.dst_ip, &index) &&
-           to_host(found.src_ip) == spread(mask.src_ip, &index);
+bool is_mask_value(const wccp_mask &mask, uint32_t index, const wccp_wire_mask &found) {
+    return to_host(found.dst_port) == spread_index_bits(mask.dst_port, &index) &&
+           to_host(found.src_port) == spread_index_bits(mask.src_port, &index) &&
+           to_host(found.dst_ip) == spread_index_bits(mask.dst_ip, &index) &&
+           to_host(found.src_ip) == spread_index_bits(mask.src_ip, &index);
 }
 
 // What a router reports of one appliance. Bits of an earlier report stay where nothing is assigned.
-bool has_slot(const wccp_rtr_view_appliance *entry, bool by_mask, uint32_t slot) {
+bool router_assigns_slot(const wccp_rtr_view_appliance *entry, bool by_mask, uint32_t slot) {
     if (entry->buckets_assigned == 0)
         return false;
     if (!by_mask) { // the word is in host order, and bucket 0 is the lowest bit of the first byte on the wire
@@ -38,15 +38,15 @@ bool has_slot(const wccp_rtr_view_appliance *entry, bool by_mask, uint32_t slot)
     return bytes[slot / 8] >> slot % 8 & 1;
 }
 
-void take_reported(const wccp_sending_router *router, bool by_mask, uint32_t slots, be32 *owners) {
+void add_reported_owners(const wccp_sending_router *router, bool by_mask, uint32_t slots, be32 *owners) {
     for (uint32_t i = 0; i < router->view_appliance_count; i++)
         for (uint32_t slot = 0; slot < slots; slot++)
-            if (owners[slot] == NOBODY && has_slot(&router->view_appliances[i], by_mask, slot))
+            if (owners[slot] == NO_OWNER && router_assigns_slot(&router->view_appliances[i], by_mask, slot))
                 owners[slot] = router->view_appliances[i].ipa;
 }
 
 // Slots whose owners are known, or 0. A router with another order of values says nothing that could be used.
-uint32_t find_owners(const wccp_service_group *group, bool by_mask, uint32_t slots, be32 *owners) {
+uint32_t find_slot_owners(const wccp_service_group *group, bool by_mask, uint32_t slots, be32 *owners) {
     memset(owners, 0, sizeof *owners * WCCP_MAX_BUCKETS);
     if (group->designated == 1 && group->bucket_count == slots && group->dsg_active_count != 0) {
         memcpy(owners, group->bucket_ipa, sizeof *owners * slots);
@@ -56,14 +56,14 @@ uint32_t find_owners(const wccp_service_group *group, bool by_mask, uint32_t slo
         if (by_mask && router->total_buckets != 0 && !router->map_in_order)
             return 0;
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
-        take_reported(router, by_mask, slots, owners);
+        add_reported_owners(router, by_mask, slots, owners);
     for (uint32_t slot = 0; slot < slots; slot++)
-        if (!(owners[slot] == NOBODY))
+        if (!(owners[slot] == NO_OWNER))
             return slots;
     return 0;
 }
 
-int print_kind(const wccp_service_group *group, bool by_mask, wccp_piece *piece) {
+int print_table_kind(const wccp_service_group *group, bool by_mask, wccp_piece *piece) {
     const wccp_mask mask = wccp_mask_of_assignment(group);
     if (by_mask)
         wccp_piece_add(piece, "mask %x %x %x %x members", mask.src_ip, mask.dst_ip, mask.src_port,
@@ -75,7 +75,7 @@ int print_kind(const wccp_service_group *group, bool by_mask, wccp_piece *piece)
     return wccp_piece_flush(piece);
 }
 
-int print_owners(const be32 *owners, uint32_t slots, wccp_piece *piece) {
+int print_owner_runs(const be32 *owners, uint32_t slots, wccp_piece *piece) {
     wccp_piece_add(piece, " owners");
     for (uint32_t first = 0, next; first < slots; first = next) {
         for (next = first + 1; next < slots && owners[next] == owners[first];)
@@ -85,17 +85,17 @@ int print_owners(const be32 *owners, uint32_t slots, wccp_piece *piece) {
     return wccp_piece_flush(piece);
 }
 
-int print_group(const wccp_service_group *group, csys_display_buf *buffer) {
+int print_group_owners(const wccp_service_group *group, csys_display_buf *buffer) {
     const bool by_mask = group->assign_method == WCCP_ASSIGN_MASK;
     if (!by_mask && group->assign_method != WCCP_ASSIGN_HASH)
         return 0;
     wccp_piece piece = wccp_assignment_piece(buffer);
-    WCCP_BAIL_ON_ZERO(print_kind(group, by_mask, &piece));
+    WCCP_BAIL_ON_ZERO(print_table_kind(group, by_mask, &piece));
     const wccp_mask mask = wccp_mask_of_assignment(group);
     const uint32_t slots = by_mask ? 1u << util_wccp_mask_get_bits_set(&mask) : WCCP_MAX_BUCKETS;
     be32 owners[WCCP_MAX_BUCKETS];
-    if (find_owners(group, by_mask, slots, owners) != 0)
-        WCCP_BAIL_ON_ZERO(print_owners(owners, slots, &piece));
+    if (find_slot_owners(group, by_mask, slots, owners) != 0)
+        WCCP_BAIL_ON_ZERO(print_owner_runs(owners, slots, &piece));
     return 0;
 }
 
@@ -109,7 +109,7 @@ bool wccp_map_is_in_order(const wccp_service_group *group, const wccp_assign_map
         to_host(theirs.src_port) != mask.src_port || to_host(theirs.dst_port) != mask.dst_port)
         return false;
     for (uint32_t i = 0; i < map->value_count; i++)
-        if (!is_value(mask, i, map->values[i].value))
+        if (!is_mask_value(mask, i, map->values[i].value))
             return false;
     return true;
 }
@@ -119,5 +119,5 @@ int wccp_print_owners(int id, csys_display_buf *buffer) {
         return 1;
     const wccp_engine_lock lock;
     const wccp_service_group *group = wccp_find_group(id);
-    return group ? print_group(group, buffer) : 1;
+    return group ? print_group_owners(group, buffer) : 1;
 }

@@ -46,7 +46,7 @@ void close_descriptor(int32_t *cell) {
     *cell = -1;
 }
 
-int32_t send_to(wccp_service_group *group, int fd, const wccp_pkt *pkt, be32 address) {
+int32_t send_datagram(wccp_service_group *group, int fd, const wccp_pkt *pkt, be32 address) {
     const sockaddr_in to = wccp_socket_address(address);
     const auto sent = static_cast<int32_t>(
         sendto(fd, pkt->data, pkt->length, 0, reinterpret_cast<const sockaddr *>(&to), sizeof to));
@@ -98,15 +98,15 @@ int32_t wccp_tx_pkt(wccp_service_group *group, wccp_pkt *pkt) {
     if (!interface->ucast_bound)
         return 0;
     if (!is_zero(pkt->ipa))
-        return send_to(group, interface->ucast_fd, pkt, pkt->ipa);
+        return send_datagram(group, interface->ucast_fd, pkt, pkt->ipa);
     if (group->mcast_configured) {
         pkt->ipa = group->mcast_ipa;
-        return send_to(group, interface->mcast_fd, pkt, pkt->ipa);
+        return send_datagram(group, interface->mcast_fd, pkt, pkt->ipa);
     }
     int32_t sum = 0;
     for (uint32_t i = 0; i < group->ucast_router_count; i++) {
         pkt->ipa = group->ucast_routers[i];
-        sum += send_to(group, interface->ucast_fd, pkt, pkt->ipa);
+        sum += send_datagram(group, interface->ucast_fd, pkt, pkt->ipa);
     }
     return sum;
 }

@@ -17,60 +17,64 @@
 #include "engine/wccp_wire.h"
 #include "runtime/md5.h"
 
+namespace {
+
 // Where a component of `size` bytes that begins as a T goes; null when it does not fit.
 template <typename T>
-static T *place(wccp_pkt *pkt, uint64_t size = sizeof(T)) {
+T *find_room(wccp_pkt *pkt, uint64_t size = sizeof(T)) {
     static_assert(alignof(T) == 1);
     if (pkt->offset + size > WCCP_MAX_PACKET)
         return nullptr;
     return reinterpret_cast<T *>(pkt->data + pkt->offset);
 }
 
-static int advance(wccp_pkt *pkt, uint64_t size) {
+int commit_component(wccp_pkt *pkt, uint64_t size) {
     pkt->offset += static_cast<uint32_t>(size);
     pkt->length += static_cast<uint32_t>(size);
     pkt->cursor = pkt->data + pkt->offset;
     return 0;
 }
 
-static wccp_wire_component component_head(uint16_t type, uint64_t size) {
+wccp_wire_component make_component_head(uint16_t type, uint64_t size) {
     return {to_be16(type), to_be16(static_cast<uint16_t>(size - sizeof(wccp_wire_component)))};
 }
 
 template <typename Entry>
-static bool is_longer_than(const Entry *entry, uint32_t count) {
+bool list_is_longer_than(const Entry *entry, uint32_t count) {
     for (; entry; entry = entry->next)
         if (count-- == 0)
             return true;
     return false;
 }
 
+} // namespace
+
 int wccp_pkt_load_msg_header(wccp_pkt *pkt, uint32_t type) {
-    auto *header = place<wccp_wire_msg_header>(pkt);
+    auto *header = find_room<wccp_wire_msg_header>(pkt);
     if (!header)
         return 1;
     *header = {.type = to_be32(type), .version = to_be16(WCCP_VERSION), .length = to_be16(0)};
-    return advance(pkt, sizeof *header);
+    return commit_component(pkt, sizeof *header);
 }
 
 int wccp_pkt_load_security_info_component(wccp_service_group *group, wccp_pkt *pkt, uint8_t **out_digest) {
     *out_digest = nullptr;
     const bool digested = group->security_option == 1;
     const uint32_t size = digested ? sizeof(wccp_wire_security_md5) : sizeof(wccp_wire_security_info);
-    auto *info = place<wccp_wire_security_info>(pkt, size);
+    auto *info = find_room<wccp_wire_security_info>(pkt, size);
     if (!info)
         return 1;
-    *info = {component_head(WCCP_SECURITY_INFO, size), to_be32(group->security_option)};
+    *info = {make_component_head(WCCP_SECURITY_INFO, size), to_be32(group->security_option)};
     if (digested)
         *out_digest = reinterpret_cast<wccp_wire_security_md5 *>(info)->digest;
-    return advance(pkt, size);
+    return commit_component(pkt, size);
 }
 
 int wccp_pkt_load_service_info_component(wccp_service_group *group, wccp_pkt *pkt) {
-    auto *info = place<wccp_wire_service_info>(pkt);
+    auto *info = find_room<wccp_wire_service_info>(pkt);
     if (!info)
         return 1;
-    info->head = component_head(WCCP_SERVICE_INFO, sizeof *info);
+    info->head = make_component_head(WCCP_SERVICE_INFO, sizeof *info);
     info->service_id = group->id;
     if (group->id > WCCP_LAST_STANDARD_ID) {
         info->service_type = 1;
@@ -78,50 +82,50 @@ int wccp_pkt_load_service_info_component(wccp_service_group *group, wccp_pkt *pk
         info->protocol = group->protocol;
         info->flags = to_be32(group->service_flags);
     }
-    return advance(pkt, sizeof *info);
+    return commit_component(pkt, sizeof *info);
 }
 
 int wccp_pkt_load_web_cache_identity_info_component(wccp_service_group *group, wccp_pkt *pkt) {
     if (group->assign_method == WCCP_ASSIGN_MASK) {
-        auto *identity = place<wccp_wire_identity_mask>(pkt);
+        auto *identity = find_room<wccp_wire_identity_mask>(pkt);
         if (!identity)
             return 1;
-        identity->head = component_head(WCCP_WEB_CACHE_IDENTITY_INFO, sizeof *identity);
+        identity->head = make_component_head(WCCP_WEB_CACHE_IDENTITY_INFO, sizeof *identity);
         identity->web_cache_id = group->appliance_ipa;
         identity->flags = to_be16(WCCP_IDENTITY_MASK);
         identity->mask_elements = to_be32(1);
         identity->mask.mask = {to_be32(group->mask_src_ip), to_be32(group->mask_dst_ip),
                                to_be16(group->mask_src_port), to_be16(group->mask_dst_port)};
         identity->weight = to_be16(group->weight);
-        return advance(pkt, sizeof *identity);
+        return commit_component(pkt, sizeof *identity);
     }
-    auto *identity = place<wccp_wire_identity_hash>(pkt);
+    auto *identity = find_room<wccp_wire_identity_hash>(pkt);
     if (!identity)
         return 1;
-    identity->head = component_head(WCCP_WEB_CACHE_IDENTITY_INFO, sizeof *identity);
+    identity->head = make_component_head(WCCP_WEB_CACHE_IDENTITY_INFO, sizeof *identity);
     identity->web_cache_id = group->appliance_ipa;
     identity->weight = to_be16(group->weight);
-    return advance(pkt, sizeof *identity);
+    return commit_component(pkt, sizeof *identity);
 }
 
 int wccp_pkt_load_web_cache_view_info_component(wccp_service_group *group, wccp_pkt *pkt) {
     const uint64_t routers = group->sending_router_count, appliances = group->appliance_view_count;
     const uint64_t size = sizeof(wccp_wire_web_cache_view) + routers * sizeof(wccp_wire_view_router_element) +
                           sizeof(be32) + appliances * sizeof(be32);
-    auto *view = place<wccp_wire_web_cache_view>(pkt, size);
+    auto *view = find_room<wccp_wire_web_cache_view>(pkt, size);
     if (!view)
         return 1;
-    if (is_longer_than(group->sending_routers, group->sending_router_count)) {
+    if (list_is_longer_than(group->sending_routers, group->sending_router_count)) {
         QV_LOG(LC_LOG_ERR, "WCCP router count (%d) mismatch with entries in router view list",
                static_cast<int>(group->sending_router_count));
         return 1;
     }
-    if (is_longer_than(group->appliance_view, group->appliance_view_count)) {
+    if (list_is_longer_than(group->appliance_view, group->appliance_view_count)) {
         QV_LOG(LC_LOG_ERR, "WCCP web cache count (%d) mismatch with entries in appliance view list",
                static_cast<int>(group->appliance_view_count));
         return 1;
     }
-    view->head = component_head(WCCP_WEB_CACHE_VIEW_INFO, size);
+    view->head = make_component_head(WCCP_WEB_CACHE_VIEW_INFO, size);
     view->change_number = to_be32(group->change_number);
     view->routers = to_be32(group->sending_router_count);
     // A list may be shorter than its count: the places of what isn't there stay zero.
@@ -133,13 +137,15 @@ int wccp_pkt_load_web_cache_view_info_component(wccp_service_group *group, wccp_
     *address++ = to_be32(group->appliance_view_count);
     for (const wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next)
         *address++ = entry->ipa;
-    return advance(pkt, size);
+    return commit_component(pkt, size);
 }
 
 // What the two forms of the assignment have in common.
 
+namespace {
+
 // Writes the router elements and returns the place after them.
-static uint8_t *write_assigned_routers(const wccp_service_group *group, void *elements) {
+uint8_t *write_router_elements(const wccp_service_group *group, void *elements) {
     auto *const first = static_cast<wccp_wire_assign_router_element *>(elements);
     auto *element = first;
     uint32_t left = group->sending_router_count;
@@ -153,7 +159,7 @@ static uint8_t *write_assigned_routers(const wccp_service_group *group, void *el
 
 // The line, with group id and both numbers, when the appliances don't have all slots. The message goes out
 // all the same.
-static void tell_unassigned_slots(const wccp_service_group *group, const char *line) {
+void log_unassigned_slots(const wccp_service_group *group, const char *line) {
     uint32_t assigned = 0;
     for (uint32_t i = 0; i < group->dsg_active_count; i++)
         assigned += group->dsg_appliances[i].assigned;
@@ -161,6 +167,8 @@ static void tell_unassigned_slots(const wccp_service_group *group, const char *l
         QV_LOG(LC_LOG_ERR, line, group->id, static_cast<int>(assigned),
                static_cast<int>(group->bucket_count));
 }
+
+} // namespace
 
 int wccp_pkt_load_assignment_info_component(wccp_service_group *group, wccp_pkt *pkt) {
     const uint32_t routers = group->sending_router_count, appliances = group->dsg_active_count;
@@ -175,19 +183,19 @@ int wccp_pkt_load_assignment_info_component(wccp_service_group *group, wccp_pkt 
     const uint64_t size = sizeof(wccp_wire_assignment_info) +
                           uint64_t{routers} * sizeof(wccp_wire_assign_router_element) + sizeof(be32) +
                           appliances * sizeof(be32) + sizeof group->bucket_index;
-    auto *info = place<wccp_wire_assignment_info>(pkt, size);
+    auto *info = find_room<wccp_wire_assignment_info>(pkt, size);
     if (!info)
         return 1;
-    *info = {component_head(WCCP_ASSIGNMENT_INFO, size), group->appliance_ipa, to_be32(group->dsg_key_change),
-             to_be32(routers)};
-    auto *address = reinterpret_cast<be32 *>(write_assigned_routers(group, info + 1));
+    *info = {make_component_head(WCCP_ASSIGNMENT_INFO, size), group->appliance_ipa,
+             to_be32(group->dsg_key_change), to_be32(routers)};
+    auto *address = reinterpret_cast<be32 *>(write_router_elements(group, info + 1));
     *address++ = to_be32(appliances);
     for (uint32_t i = 0; i < appliances; i++)
         *address++ = group->dsg_appliances[i].ipa;
     memcpy(address, group->bucket_index, sizeof group->bucket_index);
-    tell_unassigned_slots(
+    log_unassigned_slots(
         group, "WCCP GRP %d: TX HASH redirect assign: not all buckets are assigned. assigned: %d total: %d");
-    return advance(pkt, size);
+    return commit_component(pkt, size);
 }
 
 int wccp_pkt_load_mask_assignment_info_component(wccp_service_group *group, wccp_pkt *pkt) {
@@ -204,7 +212,7 @@ int wccp_pkt_load_mask_assignment_info_component(wccp_service_group *group, wccp
     const uint64_t size = sizeof(wccp_wire_mask_assignment_info) +
                           uint64_t{routers} * sizeof(wccp_wire_assign_router_element) + sizeof(be32) +
                           sizeof(wccp_wire_mask_element) + values * sizeof(wccp_wire_value_element);
-    auto *info = place<wccp_wire_mask_assignment_info>(pkt, size);
+    auto *info = find_room<wccp_wire_mask_assignment_info>(pkt, size);
     if (!info) {
         QV_LOG(LC_LOG_ERR,
                "WCCP GRP %d: TX MASK redirect assign: component: (len %d) does not fit in the pkt.",
@@ -212,13 +220,13 @@ int wccp_pkt_load_mask_assignment_info_component(wccp_service_group *group, wccp
         return 1;
     }
     constexpr uint64_t outside = offsetof(wccp_wire_mask_assignment_info, key_address);
-    *info = {.head = component_head(WCCP_MASK_ASSIGNMENT_INFO, size),
+    *info = {.head = make_component_head(WCCP_MASK_ASSIGNMENT_INFO, size),
              .assignment_type = to_be16(1),
              .assignment_length = to_be16(static_cast<uint16_t>(size - outside)),
              .key_address = group->appliance_ipa,
              .key_change = to_be32(group->dsg_key_change),
              .routers = to_be32(routers)};
-    auto *elements = reinterpret_cast<be32 *>(write_assigned_routers(group, info + 1));
+    auto *elements = reinterpret_cast<be32 *>(write_router_elements(group, info + 1));
     *elements++ = to_be32(1);
     auto *element = reinterpret_cast<wccp_wire_mask_element *>(elements);
     const wccp_mask *mask = &group->mask_in_use;
@@ -230,9 +238,9 @@ int wccp_pkt_load_mask_assignment_info_component(wccp_service_group *group, wccp
         *out++ = {.value = {to_be32(value->src_ip), to_be32(value->dst_ip), to_be16(value->src_port),
                             to_be16(value->dst_port)},
                   .appliance_id = value->appliance_ipa};
-    tell_unassigned_slots(
+    log_unassigned_slots(
         group, "WCCP GRP %d: TX MASK redirect assign: not all buckets are assigned. assigned: %d total: %d");
-    return advance(pkt, size);
+    return commit_component(pkt, size);
 }
 
 int wccp_pkt_load_capability_info_component(wccp_service_group *group, wccp_pkt *pkt) {
@@ -254,24 +262,24 @@ int wccp_pkt_load_capability_info_component(wccp_service_group *group, wccp_pkt 
         return 0;
     }
     const uint64_t size = sizeof(wccp_wire_component) + count * sizeof(wccp_wire_capability_element);
-    auto *head = place<wccp_wire_component>(pkt, size);
+    auto *head = find_room<wccp_wire_component>(pkt, size);
     if (!head)
         return 1;
-    *head = component_head(WCCP_CAPABILITY_INFO, size);
+    *head = make_component_head(WCCP_CAPABILITY_INFO, size);
     auto *element = reinterpret_cast<wccp_wire_capability_element *>(head + 1);
     for (const auto &capability : capabilities)
         if (capability.agreed == other_than_default)
             *element++ = {to_be16(capability.type), to_be16(sizeof(be32)), to_be32(other_than_default)};
-    return advance(pkt, size);
+    return commit_component(pkt, size);
 }
 
 int wccp_pkt_load_command_ext_component(wccp_service_group *group, wccp_pkt *pkt) {
-    auto *extension = place<wccp_wire_command_ext>(pkt);
+    auto *extension = find_room<wccp_wire_command_ext>(pkt);
     if (!extension)
         return 1;
-    *extension = {component_head(WCCP_COMMAND_EXTENSION, sizeof *extension), to_be16(WCCP_COMMAND_SHUTDOWN),
-                  to_be16(sizeof(be32)), group->appliance_ipa};
-    return advance(pkt, sizeof *extension);
+    *extension = {make_component_head(WCCP_COMMAND_EXTENSION, sizeof *extension),
+                  to_be16(WCCP_COMMAND_SHUTDOWN), to_be16(sizeof(be32)), group->appliance_ipa};
+    return commit_component(pkt, sizeof *extension);
 }
 
 void wccp_pkt_digest(const wccp_service_group *group, const wccp_pkt *pkt, uint8_t digest[16]) {

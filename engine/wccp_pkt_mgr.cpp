@@ -30,22 +30,22 @@
 #include "engine/wccp_view_utils.h"
 #include "runtime/md5.h"
 
-static constexpr uint32_t OPTIONAL_COMPONENTS = 3; // in one I-See-You
+namespace {
+
+constexpr uint32_t OPTIONAL_COMPONENTS = 3; // in one I-See-You
 
 // A step of reading or building a message failed.
-static int failed(const char *words, int status) {
+int log_failed_step(const char *words, int status) {
     WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: %s failed.", words);
     return status;
 }
 
-static void note_malformed(wccp_service_group *group, const wccp_pkt *pkt, const wccp_reason_text &offered,
-                           const wccp_reason_text &wanted) {
+void note_malformed_message(wccp_service_group *group, const wccp_pkt *pkt, const wccp_reason_text &offered,
+                            const wccp_reason_text &wanted) {
     wccp_note_reason(group, WCCP_REASON_MESSAGE_MALFORMED, pkt->ipa, offered, wanted);
 }
 
 // An I-See-You.
-
-namespace {
 
 // What an I-See-You says, all of it, before any of it is acted upon.
 struct icu_message {
@@ -56,10 +56,10 @@ struct icu_message {
     wccp_assign_map_info map;
 };
 
-int read_map(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
+int read_assignment_map(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
     return wccp_pkt_unload_assignment_map_component(group, pkt, &icu->map);
 }
-int read_command(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
+int read_command_extension(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
     wccp_command_info command;
     const int status = wccp_pkt_unload_command_ext_component(group, pkt, &command);
     if (status == 0)
@@ -77,8 +77,8 @@ struct optional_component {
     int (*read)(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu);
 };
 const optional_component optional_components[] = {
-    {WCCP_ASSIGNMENT_MAP, "unloading assignment map", read_map},
-    {WCCP_COMMAND_EXTENSION, "unloading command ext comp.", read_command},
+    {WCCP_ASSIGNMENT_MAP, "unloading assignment map", read_assignment_map},
+    {WCCP_COMMAND_EXTENSION, "unloading command ext comp.", read_command_extension},
     {WCCP_CAPABILITY_INFO, "unloading capability comp.", read_capabilities},
 };
 
@@ -89,33 +89,34 @@ int read_optional_component(wccp_service_group *group, wccp_pkt *pkt, icu_messag
         if (row.type != type)
             continue;
         const int status = row.read(group, pkt, icu);
-        return status ? failed(row.words, status) : 0;
+        return status ? log_failed_step(row.words, status) : 0;
     }
     WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: ICU component type (%d) not recognized. sender router id %s",
                   group->id, type, addr_text(icu->router_id).s);
-    return wccp_pkt_unload_unknown_component(group, pkt) ? failed("unloading unknown component", 1) : 0;
+    return wccp_pkt_unload_unknown_component(group, pkt) ? log_failed_step("unloading unknown component", 1)
+                                                         : 0;
 }
 
-wccp_reason_text service_text(uint32_t priority, uint32_t protocol, uint32_t flags) {
+wccp_reason_text format_service(uint32_t priority, uint32_t protocol, uint32_t flags) {
     return wccp_reason_value("priority %u, protocol %u, flags 0x%x", priority, protocol, flags);
 }
 
 // The message as a whole: its components in their order, and no change of the group but its reasons.
-int read_icu(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_info *service,
-             icu_message *icu) {
+int read_i_see_you(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_info *service,
+                   icu_message *icu) {
     *icu = {};
     icu->offered = {WCCP_METHOD_GRE, WCCP_ASSIGN_HASH, WCCP_METHOD_GRE};
     const wccp_wire_router_identity *identity;
     if (const int status = wccp_pkt_unload_router_identity_info_component(group, pkt, &identity))
-        return failed("unloading router identity", status);
+        return log_failed_step("unloading router identity", status);
     icu->router_id = identity->router_id;
     icu->receive_id = identity->receive_id;
     const uint32_t flags = to_host(service->flags);
     if (service->priority != group->priority || service->protocol != group->protocol ||
         flags != group->service_flags) {
         wccp_note_reason(group, WCCP_REASON_SERVICE_MISMATCH, icu->router_id,
-                         service_text(service->priority, service->protocol, flags),
-                         service_text(group->priority, group->protocol, group->service_flags));
+                         format_service(service->priority, service->protocol, flags),
+                         format_service(group->priority, group->protocol, group->service_flags));
         WCCP_COMPLAIN(
             LC_LOG_WARNING,
             "WCCP GRP %d: service group config mismatch (router id: %s) .priority: rxed = %u local = %u, "
@@ -125,15 +126,15 @@ int read_icu(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_i
         group->rx_service_mismatches++;
     }
     if (const int status = wccp_pkt_unload_router_view_component(group, pkt, &icu->view))
-        return failed("unloading router view", status);
+        return log_failed_step("unloading router view", status);
     for (uint32_t count = 0; pkt->offset < pkt->length;) {
         if (const int status = read_optional_component(group, pkt, icu))
             return status;
         if (++count > OPTIONAL_COMPONENTS) {
             WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: ICU bogus packet  (too many optional components).",
                           group->id);
-            note_malformed(group, pkt, wccp_reason_value("%u optional components", count),
-                           wccp_reason_value("%u at most", OPTIONAL_COMPONENTS));
+            note_malformed_message(group, pkt, wccp_reason_value("%u optional components", count),
+                                   wccp_reason_value("%u at most", OPTIONAL_COMPONENTS));
             return 1;
         }
     }
@@ -154,12 +155,12 @@ wccp_sending_router *find_or_create_router(wccp_service_group *group, const icu_
     return compatible ? wccp_create_sending_router(group, icu->router_id, &icu->offered, &agreed) : nullptr;
 }
 
-wccp_reason_text key_text(be32 address, uint32_t change) {
+wccp_reason_text format_assignment_key(be32 address, uint32_t change) {
     return wccp_reason_value("table %s number %u", addr_text(address).s, change);
 }
 
-void take_acknowledgement(wccp_service_group *group, wccp_sending_router *router,
-                          const wccp_rtr_view_info *view) {
+void check_acknowledgement(wccp_service_group *group, wccp_sending_router *router,
+                           const wccp_rtr_view_info *view) {
     if (!(router->flags & WCCP_RTR_ASSIGN_UNACKED))
         return;
     const uint32_t key_change = to_host(view->key_change);
@@ -181,13 +182,13 @@ void take_acknowledgement(wccp_service_group *group, wccp_sending_router *router
            static_cast<int>(router->assign_tx_count), group->pending_acks);
     if (router->assign_tx_count > 1)
         wccp_note_reason(group, WCCP_REASON_NOT_ACKNOWLEDGED, router->router_id,
-                         key_text(view->key_ipa, key_change),
-                         key_text(group->appliance_ipa, group->dsg_key_change));
+                         format_assignment_key(view->key_ipa, key_change),
+                         format_assignment_key(group->appliance_ipa, group->dsg_key_change));
 }
 
 // Takes the values of an Assignment Map into the router's view, and counts those of this appliance.
-wccp_assign_summary take_map(const wccp_service_group *group, wccp_sending_router *router,
-                             const wccp_assign_map_info *map) {
+wccp_assign_summary apply_assignment_map(const wccp_service_group *group, wccp_sending_router *router,
+                                         const wccp_assign_map_info *map) {
     router->map_src_ip = to_host(map->masks->mask.src_ip);
     router->map_dst_ip = to_host(map->masks->mask.dst_ip);
     router->map_src_port = router->map_dst_port = 0;
@@ -217,7 +218,8 @@ wccp_assign_summary take_map(const wccp_service_group *group, wccp_sending_route
 }
 
 // The mask that the router uses, as the designated appliance gave it.
-void check_mask(wccp_service_group *group, const wccp_sending_router *router, const wccp_wire_mask *mask) {
+void note_mask_difference(wccp_service_group *group, const wccp_sending_router *router,
+                          const wccp_wire_mask *mask) {
     const bool same =
         to_host(mask->src_ip) == group->mask_src_ip && to_host(mask->dst_ip) == group->mask_dst_ip &&
         to_host(mask->src_port) == group->mask_src_port && to_host(mask->dst_port) == group->mask_dst_port;
@@ -234,8 +236,8 @@ void check_mask(wccp_service_group *group, const wccp_sending_router *router, co
 }
 
 // Another appliance that assigns by another method shows in the form of its entry in the router's view.
-void check_methods(wccp_service_group *group, const wccp_sending_router *router,
-                   const wccp_rtr_view_appliance *decoded, uint32_t count, uint32_t by_mask) {
+void note_method_differences(wccp_service_group *group, const wccp_sending_router *router,
+                             const wccp_rtr_view_appliance *decoded, uint32_t count, uint32_t by_mask) {
     for (uint32_t i = 0; i < count; i++) {
         const uint32_t method = (by_mask >> i & 1) != 0 ? WCCP_ASSIGN_MASK : WCCP_ASSIGN_HASH;
         if (method != group->assign_method && !(decoded[i].ipa == group->appliance_ipa))
@@ -246,7 +248,7 @@ void check_methods(wccp_service_group *group, const wccp_sending_router *router,
     }
 }
 
-void check_listing(wccp_service_group *group, const wccp_sending_router *router) {
+void note_missing_listing(wccp_service_group *group, const wccp_sending_router *router) {
     if (!(router->flags & WCCP_RTR_TWO_WAY))
         wccp_note_reason(group, WCCP_REASON_NOT_IN_VIEW, router->router_id,
                          wccp_reason_value("%u appliances", router->view_appliance_count),
@@ -258,7 +260,7 @@ void check_listing(wccp_service_group *group, const wccp_sending_router *router)
 int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
                                const wccp_wire_service_info *service) {
     icu_message icu;
-    if (const int status = read_icu(group, pkt, service, &icu))
+    if (const int status = read_i_see_you(group, pkt, service, &icu))
         return status;
     int status;
     wccp_sending_router *router = find_or_create_router(group, &icu, &status);
@@ -269,7 +271,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
     router->last_icu_time = wccp_g.seconds;
     router->src_ipa = pkt->ipa;
     router->change_number = icu.view.change_number;
-    take_acknowledgement(group, router, &icu.view);
+    check_acknowledgement(group, router, &icu.view);
     if ((status = wccp_update_router_view(group, router, icu.view.router_count, icu.view.routers)) != 0)
         return status;
     wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES] = {};
@@ -277,21 +279,21 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
     status = wccp_process_router_view_web_cache_id_elements(group, icu.view.appliance_count,
                                                             icu.view.appliances, decoded, &hash);
     if (status != 0)
-        note_malformed(group, pkt, wccp_reason_value("its appliances"), {});
+        note_malformed_message(group, pkt, wccp_reason_value("its appliances"), {});
     else
         status = wccp_update_appliance_view(group, router, icu.view.appliance_count, decoded);
     if (status != 0)
         return status;
     if (icu.map.present) {
         if (!icu.map.masks || !icu.map.values) {
-            note_malformed(group, pkt, wccp_reason_value("an assignment map without a mask"), {});
+            note_malformed_message(group, pkt, wccp_reason_value("an assignment map without a mask"), {});
             return 1;
         }
-        mask = take_map(group, router, &icu.map);
-        check_mask(group, router, &icu.map.masks->mask);
+        mask = apply_assignment_map(group, router, &icu.map);
+        note_mask_difference(group, router, &icu.map.masks->mask);
     }
-    check_methods(group, router, decoded, icu.view.appliance_count, hash.mask_forms);
-    check_listing(group, router);
+    note_method_differences(group, router, decoded, icu.view.appliance_count, hash.mask_forms);
+    note_missing_listing(group, router);
     status = wccp_update_appliance_redirect_status(group, router, &hash, &mask);
     if (status == 0)
         wccp_forget_refusals(group, router->router_id, pkt->ipa);
@@ -301,7 +303,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
 int wccp_pkt_process_removal_query(wccp_service_group *group, wccp_pkt *pkt) {
     const wccp_wire_router_query *query;
     if (wccp_pkt_unload_router_query_component(group, pkt, &query))
-        return failed("unloading router query", 1);
+        return log_failed_step("unloading router query", 1);
     if (!(query->target == group->appliance_ipa)) {
         QV_LOG(LC_LOG_INFO,
                "WCCP GRP %d: removal query is not for us. sending router id: %s target appliance: %s",
@@ -313,14 +315,16 @@ int wccp_pkt_process_removal_query(wccp_service_group *group, wccp_pkt *pkt) {
 
 // A packet.
 
-static int refuse(const wccp_pkt *pkt) {
+namespace {
+
+int refuse_packet(const wccp_pkt *pkt) {
     wccp_g.rx_failures++;
     WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP processing received packet from %s failed", addr_text(pkt->ipa).s);
     return 1;
 }
 
 // `digest` lies in the packet and is zero afterwards.
-static bool digest_is_right(const wccp_service_group *group, const wccp_pkt *pkt, uint8_t *digest) {
+bool verify_digest(const wccp_service_group *group, const wccp_pkt *pkt, uint8_t *digest) {
     uint8_t received[MD5_DIGEST_BYTES], computed[MD5_DIGEST_BYTES];
     memcpy(received, digest, sizeof received);
     memset(digest, 0, sizeof received);
@@ -328,24 +332,25 @@ static bool digest_is_right(const wccp_service_group *group, const wccp_pkt *pkt
     return memcmp(received, computed, sizeof received) == 0;
 }
 
-static wccp_reason_text security_text(uint32_t option) {
+wccp_reason_text format_security_option(uint32_t option) {
     return option <= 1 ? wccp_reason_value("%s", option ? "MD5" : "none")
                        : wccp_reason_value("option %u", option);
 }
 
 // True when the packet has the security that the group asks for.
-static bool passes_security(wccp_service_group *group, const wccp_pkt *pkt,
-                            const wccp_wire_security_info *security, uint8_t *digest) {
+bool check_security(wccp_service_group *group, const wccp_pkt *pkt, const wccp_wire_security_info *security,
+                    uint8_t *digest) {
     const uint32_t option = to_host(security->option);
     if (option != group->security_option) {
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed mismatch security opt: %d configured opt: %d",
                       group->id, static_cast<int>(option), static_cast<int>(group->security_option));
         group->rx_auth_mismatches++;
         wccp_note_reason(group, option == 0 ? WCCP_REASON_SECURITY_MISSING : WCCP_REASON_SECURITY_UNWANTED,
-                         pkt->ipa, security_text(option), security_text(group->security_option));
+                         pkt->ipa, format_security_option(option),
+                         format_security_option(group->security_option));
         return false;
     }
-    if (option == 1 && !digest_is_right(group, pkt, digest)) {
+    if (option == 1 && !verify_digest(group, pkt, digest)) {
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed authentication failed. Sender's source IP: %s",
                       group->id, addr_text(pkt->ipa).s);
         group->rx_auth_failures++;
@@ -355,11 +360,13 @@ static bool passes_security(wccp_service_group *group, const wccp_pkt *pkt,
     return true;
 }
 
+} // namespace
+
 int wccp_process_received_packet(wccp_pkt *pkt) {
     const wccp_wire_msg_header *header;
     if (wccp_pkt_unload_msg_header(pkt, &header)) {
-        failed("unloading msg header", 1);
-        return refuse(pkt);
+        log_failed_step("unloading msg header", 1);
+        return refuse_packet(pkt);
     }
     const uint32_t told = to_host(header->length) + static_cast<uint32_t>(sizeof *header);
     if (told != pkt->length) {
@@ -391,13 +398,13 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
     const wccp_wire_security_info *security;
     uint8_t *digest;
     if (wccp_pkt_unload_security_info_component(pkt, &security, &digest)) {
-        failed("unloading security info", 1);
-        return refuse(pkt);
+        log_failed_step("unloading security info", 1);
+        return refuse_packet(pkt);
     }
     const wccp_wire_service_info *service;
     if (wccp_pkt_unload_service_info_component(pkt, &service)) {
-        failed("unloading service info", 1);
-        return refuse(pkt);
+        log_failed_step("unloading service info", 1);
+        return refuse_packet(pkt);
     }
     wccp_service_group *group = wccp_find_group(service->service_id);
     if (!group) {
@@ -405,7 +412,7 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
                       service->service_id, service->service_id);
         wccp_note_reason(nullptr, WCCP_REASON_GROUP_UNKNOWN, pkt->ipa,
                          wccp_reason_value("group %d", service->service_id), {});
-        return refuse(pkt);
+        return refuse_packet(pkt);
     }
     if (group->admin_state != WCCP_ADMIN_UP) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: is disabled. dropping the rxed packet.", group->id);
@@ -418,9 +425,9 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
         wccp_note_reason(group, WCCP_REASON_GROUP_STOPPED, pkt->ipa, {}, {});
         return 0;
     }
-    if (!passes_security(group, pkt, security, digest)) {
+    if (!check_security(group, pkt, security, digest)) {
         group->rx_failures++;
-        return refuse(pkt);
+        return refuse_packet(pkt);
     }
     if (type == WCCP_I_SEE_YOU) {
         group->rx_icus++;
@@ -453,28 +460,28 @@ struct build_step {
 
 // A load that takes group and packet, as a step.
 template <int (*Load)(wccp_service_group *, wccp_pkt *)>
-int step_of(message_build *build) {
+int run_load(message_build *build) {
     return Load(build->group, build->pkt);
 }
 template <uint32_t Type>
-int header_step(message_build *build) {
+int load_header(message_build *build) {
     return wccp_pkt_load_msg_header(build->pkt, Type);
 }
-int security_step(message_build *build) {
+int load_security_info(message_build *build) {
     return wccp_pkt_load_security_info_component(build->group, build->pkt, &build->digest);
 }
-int finish_step(message_build *build) {
+int finish_message(message_build *build) {
     return wccp_pkt_finish(build->group, build->pkt, build->digest);
 }
-int refusing_step(message_build *) {
+int refuse_unset_method(message_build *) {
     return 1;
 }
 
 template <uint32_t Method>
-bool assigns_by(const wccp_service_group *group) {
+bool uses_assign_method(const wccp_service_group *group) {
     return group->assign_method == Method;
 }
-bool assigns_by_neither(const wccp_service_group *group) {
+bool has_no_assign_method(const wccp_service_group *group) {
     return group->assign_method != WCCP_ASSIGN_HASH && group->assign_method != WCCP_ASSIGN_MASK;
 }
 bool has_capabilities(const wccp_service_group *group) {
@@ -486,38 +493,40 @@ bool is_shutting_down(const wccp_service_group *group) {
 }
 
 const build_step here_i_am_steps[] = {
-    {"here-i-am: loading message header", header_step<WCCP_HERE_I_AM>, nullptr},
-    {"here-i-am: loading security info", security_step, nullptr},
-    {"here-i-am: loading service info", step_of<wccp_pkt_load_service_info_component>, nullptr},
-    {"here-i-am: loading web-cache info", step_of<wccp_pkt_load_web_cache_identity_info_component>, nullptr},
-    {"here-i-am: loading web-cache view info", step_of<wccp_pkt_load_web_cache_view_info_component>, nullptr},
-    {"here-i-am: loading capability info", step_of<wccp_pkt_load_capability_info_component>,
+    {"here-i-am: loading message header", load_header<WCCP_HERE_I_AM>, nullptr},
+    {"here-i-am: loading security info", load_security_info, nullptr},
+    {"here-i-am: loading service info", run_load<wccp_pkt_load_service_info_component>, nullptr},
+    {"here-i-am: loading web-cache info", run_load<wccp_pkt_load_web_cache_identity_info_component>, nullptr},
+    {"here-i-am: loading web-cache view info", run_load<wccp_pkt_load_web_cache_view_info_component>,
+     nullptr},
+    {"here-i-am: loading capability info", run_load<wccp_pkt_load_capability_info_component>,
      has_capabilities},
-    {"here-i-am: loading command extension", step_of<wccp_pkt_load_command_ext_component>, is_shutting_down},
-    {"here-i-am: packet finish", finish_step, nullptr},
+    {"here-i-am: loading command extension", run_load<wccp_pkt_load_command_ext_component>, is_shutting_down},
+    {"here-i-am: packet finish", finish_message, nullptr},
 };
 const build_step redirect_assign_steps[] = {
-    {"redirect assign: loading message header", header_step<WCCP_REDIRECT_ASSIGN>, nullptr},
-    {"redirect assign: loading security info", security_step, nullptr},
-    {"redirect assign: loading service info", step_of<wccp_pkt_load_service_info_component>, nullptr},
-    {"redirect assign: loading assign. info", step_of<wccp_pkt_load_assignment_info_component>,
-     assigns_by<WCCP_ASSIGN_HASH>},
-    {"redirect assign: loading mask assign. info", step_of<wccp_pkt_load_mask_assignment_info_component>,
-     assigns_by<WCCP_ASSIGN_MASK>},
-    {"redirect assign: groups actual assignment method is not set.", refusing_step, assigns_by_neither},
-    {"redirect assign: packet finish", finish_step, nullptr},
+    {"redirect assign: loading message header", load_header<WCCP_REDIRECT_ASSIGN>, nullptr},
+    {"redirect assign: loading security info", load_security_info, nullptr},
+    {"redirect assign: loading service info", run_load<wccp_pkt_load_service_info_component>, nullptr},
+    {"redirect assign: loading assign. info", run_load<wccp_pkt_load_assignment_info_component>,
+     uses_assign_method<WCCP_ASSIGN_HASH>},
+    {"redirect assign: loading mask assign. info", run_load<wccp_pkt_load_mask_assignment_info_component>,
+     uses_assign_method<WCCP_ASSIGN_MASK>},
+    {"redirect assign: groups actual assignment method is not set.", refuse_unset_method,
+     has_no_assign_method},
+    {"redirect assign: packet finish", finish_message, nullptr},
 };
 
 template <size_t Count>
-int run_steps(const build_step (&steps)[Count], wccp_reason_code reason, wccp_service_group *group,
-              wccp_pkt *pkt) {
+int run_build_steps(const build_step (&steps)[Count], wccp_reason_code reason, wccp_service_group *group,
+                    wccp_pkt *pkt) {
     message_build build = {group, pkt, nullptr};
     for (const build_step &step : steps) {
         if (step.wanted && !step.wanted(group))
             continue;
         if (const int status = step.load(&build)) {
             wccp_note_reason(group, reason, {}, wccp_reason_value("%s", step.words), {});
-            return failed(step.words, status);
+            return log_failed_step(step.words, status);
         }
     }
     wccp_forget_reason(group, reason, {});
@@ -539,7 +548,7 @@ const packet_kind packet_kinds[] = {
     {WCCP_REMOVAL_REPLY, "HERE-I-AM (router query reply)", &wccp_service_group::tx_removal_replies, nullptr},
 };
 
-const packet_kind *find_kind(uint32_t number) {
+const packet_kind *find_packet_kind(uint32_t number) {
     for (const packet_kind &kind : packet_kinds)
         if (kind.number == number)
             return &kind;
@@ -554,11 +563,11 @@ void clear_packet(wccp_pkt *pkt) {
 } // namespace
 
 int wccp_pkt_build_here_i_am(wccp_service_group *group, wccp_pkt *pkt) {
-    return run_steps(here_i_am_steps, WCCP_REASON_HERE_I_AM_NOT_BUILT, group, pkt);
+    return run_build_steps(here_i_am_steps, WCCP_REASON_HERE_I_AM_NOT_BUILT, group, pkt);
 }
 
 int wccp_pkt_build_redirect_assign(wccp_service_group *group, wccp_pkt *pkt) {
-    return run_steps(redirect_assign_steps, WCCP_REASON_TABLE_NOT_BUILT, group, pkt);
+    return run_build_steps(redirect_assign_steps, WCCP_REASON_TABLE_NOT_BUILT, group, pkt);
 }
 
 int wccp_transmit_packet(wccp_service_group *group, wccp_pkt *pkt, uint32_t number) {
@@ -572,7 +581,7 @@ int wccp_transmit_packet(wccp_service_group *group, wccp_pkt *pkt, uint32_t numb
         group->tx_link_drops++;
         return 0;
     }
-    const packet_kind *kind = find_kind(number);
+    const packet_kind *kind = find_packet_kind(number);
     if (!kind) {
         QV_LOG(LC_LOG_ERR, "WCCP transmit: unknown packet type (%d)", static_cast<int>(number));
         group->tx_failures++;

@@ -34,14 +34,14 @@ struct received_bytes {
     uint32_t size;
 };
 
-uint32_t remaining(const wccp_pkt *pkt) {
+uint32_t count_remaining_bytes(const wccp_pkt *pkt) {
     const uint32_t received = pkt->length < WCCP_MAX_PACKET ? pkt->length : WCCP_MAX_PACKET;
     return pkt->offset < received ? received - pkt->offset : 0;
 }
 
 // `count` Ts at `distance` bytes from the first one; null when not all of them were received.
 template <typename T>
-const T *look(received_bytes bytes, uint64_t distance = 0, uint64_t count = 1) {
+const T *peek_layout(received_bytes bytes, uint64_t distance = 0, uint64_t count = 1) {
     static_assert(alignof(T) == 1);
     if (distance + count * sizeof(T) > bytes.size)
         return nullptr;
@@ -49,13 +49,13 @@ const T *look(received_bytes bytes, uint64_t distance = 0, uint64_t count = 1) {
 }
 // The same from the packet's cursor.
 template <typename T>
-const T *look(const wccp_pkt *pkt, uint64_t distance = 0, uint64_t count = 1) {
-    return look<T>({pkt->data + pkt->offset, remaining(pkt)}, distance, count);
+const T *peek_layout(const wccp_pkt *pkt, uint64_t distance = 0, uint64_t count = 1) {
+    return peek_layout<T>({pkt->data + pkt->offset, count_remaining_bytes(pkt)}, distance, count);
 }
 
 // Moves on by `size` bytes, 0; or not at all, 1, when they were not received.
-int pass(wccp_pkt *pkt, uint64_t size) {
-    if (size > remaining(pkt))
+int skip_bytes(wccp_pkt *pkt, uint64_t size) {
+    if (size > count_remaining_bytes(pkt))
         return 1;
     pkt->offset += static_cast<uint32_t>(size);
     pkt->cursor = pkt->data + pkt->offset;
@@ -63,24 +63,25 @@ int pass(wccp_pkt *pkt, uint64_t size) {
 }
 
 // Notes why a message is refused, with what it has and what it should have; gives 1.
-int refuse(wccp_service_group *group, const wccp_pkt *pkt, const wccp_reason_text &has,
-           const wccp_reason_text &should_have, wccp_reason_code code = WCCP_REASON_MESSAGE_MALFORMED) {
+int refuse_message(wccp_service_group *group, const wccp_pkt *pkt, const wccp_reason_text &has,
+                   const wccp_reason_text &should_have,
+                   wccp_reason_code code = WCCP_REASON_MESSAGE_MALFORMED) {
     wccp_note_reason(group, code, pkt->ipa, has, should_have);
     return 1;
 }
 // The same of a component that does not fit, or whose own length is another than it should be.
-int refuse_size(wccp_service_group *group, const wccp_pkt *pkt, const char *what, uint64_t size,
-                uint64_t should_be) {
-    return refuse(group, pkt, wccp_reason_value("%s of %" PRIu64 " bytes", what, size),
-                  wccp_reason_value("%" PRIu64 " bytes", should_be));
+int refuse_message_size(wccp_service_group *group, const wccp_pkt *pkt, const char *what, uint64_t size,
+                        uint64_t should_be) {
+    return refuse_message(group, pkt, wccp_reason_value("%s of %" PRIu64 " bytes", what, size),
+                          wccp_reason_value("%" PRIu64 " bytes", should_be));
 }
-int refuse_type(wccp_service_group *group, const wccp_pkt *pkt, uint32_t type, uint32_t should_be) {
-    return refuse(group, pkt, wccp_reason_value("component type %u", type),
-                  wccp_reason_value("type %u", should_be));
+int refuse_component_type(wccp_service_group *group, const wccp_pkt *pkt, uint32_t type, uint32_t should_be) {
+    return refuse_message(group, pkt, wccp_reason_value("component type %u", type),
+                          wccp_reason_value("type %u", should_be));
 }
 
 // A size as an argument for the %d of a log line.
-int shown(uint64_t size) {
+int clamp_to_int(uint64_t size) {
     return size < INT_MAX ? static_cast<int>(size) : INT_MAX;
 }
 
@@ -89,30 +90,30 @@ int shown(uint64_t size) {
 // The way every message begins.
 
 int wccp_pkt_unload_msg_header(wccp_pkt *pkt, const wccp_wire_msg_header **out) {
-    *out = look<wccp_wire_msg_header>(pkt);
-    return *out ? pass(pkt, sizeof **out)
-                : refuse_size(nullptr, pkt, "a header", remaining(pkt), sizeof **out);
+    *out = peek_layout<wccp_wire_msg_header>(pkt);
+    return *out ? skip_bytes(pkt, sizeof **out)
+                : refuse_message_size(nullptr, pkt, "a header", count_remaining_bytes(pkt), sizeof **out);
 }
 
 int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_security_info **out,
                                             uint8_t **out_digest) {
     *out = nullptr;
     *out_digest = nullptr;
-    const auto *info = look<wccp_wire_security_info>(pkt);
+    const auto *info = peek_layout<wccp_wire_security_info>(pkt);
     if (!info)
-        return refuse_size(nullptr, pkt, "a security info", remaining(pkt), sizeof *info);
+        return refuse_message_size(nullptr, pkt, "a security info", count_remaining_bytes(pkt), sizeof *info);
     const bool digested = to_host(info->option) == 1;
     const uint32_t size = digested ? sizeof(wccp_wire_security_md5) : sizeof(wccp_wire_security_info);
     if (to_host(info->head.type) != WCCP_SECURITY_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: expected security componenet. rxed %d", to_host(info->head.type));
-        return refuse_type(nullptr, pkt, to_host(info->head.type), WCCP_SECURITY_INFO);
+        return refuse_component_type(nullptr, pkt, to_host(info->head.type), WCCP_SECURITY_INFO);
     }
     if (to_host(info->head.length) > size - sizeof info->head)
-        return refuse_size(nullptr, pkt, "a security info", to_host(info->head.length),
-                           size - sizeof info->head);
+        return refuse_message_size(nullptr, pkt, "a security info", to_host(info->head.length),
+                                   size - sizeof info->head);
     uint8_t *const digest = pkt->data + pkt->offset + offsetof(wccp_wire_security_md5, digest);
-    if (pass(pkt, size))
-        return refuse_size(nullptr, pkt, "a security info", remaining(pkt), size);
+    if (skip_bytes(pkt, size))
+        return refuse_message_size(nullptr, pkt, "a security info", count_remaining_bytes(pkt), size);
     *out = info;
     *out_digest = digested ? digest : nullptr;
     return 0;
@@ -120,19 +121,19 @@ int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_secur
 
 int wccp_pkt_unload_service_info_component(wccp_pkt *pkt, const wccp_wire_service_info **out) {
     *out = nullptr;
-    const auto *info = look<wccp_wire_service_info>(pkt);
+    const auto *info = peek_layout<wccp_wire_service_info>(pkt);
     if (!info)
-        return refuse_size(nullptr, pkt, "a service info", remaining(pkt), sizeof *info);
+        return refuse_message_size(nullptr, pkt, "a service info", count_remaining_bytes(pkt), sizeof *info);
     if (to_host(info->head.type) != WCCP_SERVICE_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: expected service info componenet. rxed %d",
                       to_host(info->head.type));
-        return refuse_type(nullptr, pkt, to_host(info->head.type), WCCP_SERVICE_INFO);
+        return refuse_component_type(nullptr, pkt, to_host(info->head.type), WCCP_SERVICE_INFO);
     }
     if (to_host(info->head.length) != sizeof *info - sizeof info->head)
-        return refuse_size(nullptr, pkt, "a service info", to_host(info->head.length),
-                           sizeof *info - sizeof info->head);
+        return refuse_message_size(nullptr, pkt, "a service info", to_host(info->head.length),
+                                   sizeof *info - sizeof info->head);
     *out = info;
-    return pass(pkt, sizeof *info);
+    return skip_bytes(pkt, sizeof *info);
 }
 
 // The components of an I-See-You that each one has.
@@ -140,30 +141,31 @@ int wccp_pkt_unload_service_info_component(wccp_pkt *pkt, const wccp_wire_servic
 int wccp_pkt_unload_router_identity_info_component(wccp_service_group *group, wccp_pkt *pkt,
                                                    const wccp_wire_router_identity **out) {
     *out = nullptr;
-    const auto *identity = look<wccp_wire_router_identity>(pkt);
+    const auto *identity = peek_layout<wccp_wire_router_identity>(pkt);
     if (!identity) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: static length (%d) is longer than remaining pkt len (%d)",
-                      group->id, shown(sizeof *identity), shown(remaining(pkt)));
-        return refuse_size(group, pkt, "a router identity", remaining(pkt), sizeof *identity);
+                      group->id, clamp_to_int(sizeof *identity), clamp_to_int(count_remaining_bytes(pkt)));
+        return refuse_message_size(group, pkt, "a router identity", count_remaining_bytes(pkt),
+                                   sizeof *identity);
     }
     if (to_host(identity->head.type) != WCCP_ROUTER_IDENTITY_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: expecting router id info, rxed %d", group->id,
                       to_host(identity->head.type));
-        return refuse_type(group, pkt, to_host(identity->head.type), WCCP_ROUTER_IDENTITY_INFO);
+        return refuse_component_type(group, pkt, to_host(identity->head.type), WCCP_ROUTER_IDENTITY_INFO);
     }
     const uint64_t size = sizeof *identity + uint64_t{to_host(identity->received_from)} * sizeof(be32);
-    if (size > remaining(pkt)) {
+    if (size > count_remaining_bytes(pkt)) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: full length does not fit in pkt", group->id);
-        return refuse_size(group, pkt, "a router identity", remaining(pkt), size);
+        return refuse_message_size(group, pkt, "a router identity", count_remaining_bytes(pkt), size);
     }
     if (to_host(identity->head.length) != size - sizeof identity->head) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: rxed length (%d) and expected length (%d) mismatch",
-                      group->id, to_host(identity->head.length), shown(size - sizeof identity->head));
-        return refuse_size(group, pkt, "a router identity", to_host(identity->head.length),
-                           size - sizeof identity->head);
+                      group->id, to_host(identity->head.length), clamp_to_int(size - sizeof identity->head));
+        return refuse_message_size(group, pkt, "a router identity", to_host(identity->head.length),
+                                   size - sizeof identity->head);
     }
     *out = identity;
-    return pass(pkt, size);
+    return skip_bytes(pkt, size);
 }
 
 wccp_element_shape wccp_view_element_shape(uint16_t flags, uint32_t compat_mode) {
@@ -184,71 +186,77 @@ wccp_element_shape wccp_view_element_shape(uint16_t flags, uint32_t compat_mode)
     return compat_mode == WCCP_COMPAT_NEXUS ? nexus : ios;
 }
 
+namespace {
+
 // The size of a router view whose `count` elements begin at `distance`. False when not all of them were
 // received.
-static bool measure_view(const wccp_service_group *group, const wccp_pkt *pkt, uint64_t distance,
+bool measure_router_view(const wccp_service_group *group, const wccp_pkt *pkt, uint64_t distance,
                          uint32_t count, uint64_t *out_size) {
     for (uint32_t i = 0; i < count; i++) {
-        const auto *element = look<wccp_wire_view_element>(pkt, distance);
+        const auto *element = peek_layout<wccp_wire_view_element>(pkt, distance);
         if (!element)
             return false;
         distance += wccp_view_element_shape(to_host(element->flags), group->compat_mode).size;
     }
     *out_size = distance;
-    return distance <= remaining(pkt);
+    return distance <= count_remaining_bytes(pkt);
 }
+
+} // namespace
 
 int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *pkt, wccp_rtr_view_info *out) {
     *out = {};
-    const auto *view = look<wccp_wire_router_view>(pkt);
+    const auto *view = peek_layout<wccp_wire_router_view>(pkt);
     if (!view) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: static component does not fit in pkt", group->id);
-        return refuse_size(group, pkt, "a router view", remaining(pkt), sizeof *view);
+        return refuse_message_size(group, pkt, "a router view", count_remaining_bytes(pkt), sizeof *view);
     }
     if (to_host(view->head.type) != WCCP_ROUTER_VIEW_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: bad router view type rxed (%d)", to_host(view->head.type));
-        return refuse_type(group, pkt, to_host(view->head.type), WCCP_ROUTER_VIEW_INFO);
+        return refuse_component_type(group, pkt, to_host(view->head.type), WCCP_ROUTER_VIEW_INFO);
     }
     const uint32_t routers = to_host(view->routers);
     if (routers > WCCP_MAX_ROUTERS) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad number of routers (%d) in ICU pkt. ", group->id,
                       static_cast<int>(routers));
-        return refuse(group, pkt, wccp_reason_value("%u routers", routers),
-                      wccp_reason_value("%u at most", WCCP_MAX_ROUTERS));
+        return refuse_message(group, pkt, wccp_reason_value("%u routers", routers),
+                              wccp_reason_value("%u at most", WCCP_MAX_ROUTERS));
     }
-    const auto *addresses = look<be32>(pkt, sizeof *view, routers);
+    const auto *addresses = peek_layout<be32>(pkt, sizeof *view, routers);
     if (!addresses) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: number of routers does not fit in pkt", group->id);
-        return refuse_size(group, pkt, "a router view", remaining(pkt),
-                           sizeof *view + routers * sizeof *addresses);
+        return refuse_message_size(group, pkt, "a router view", count_remaining_bytes(pkt),
+                                   sizeof *view + routers * sizeof *addresses);
     }
     const uint32_t elements_at = static_cast<uint32_t>(sizeof *view + (routers + 1) * sizeof(be32));
     // Where the count was cut off there are no appliances; the view then doesn't fit, because the count
     // doesn't.
-    const auto *count = look<be32>(pkt, elements_at - sizeof(be32));
+    const auto *count = peek_layout<be32>(pkt, elements_at - sizeof(be32));
     const uint32_t appliances = count ? to_host(*count) : 0;
     if (appliances > WCCP_MAX_APPLIANCES) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad number of appliances (%d) in ICU pkt.", group->id,
                       static_cast<int>(appliances));
-        return refuse(group, pkt, wccp_reason_value("%u appliances", appliances),
-                      wccp_reason_value("%u at most", WCCP_MAX_APPLIANCES));
+        return refuse_message(group, pkt, wccp_reason_value("%u appliances", appliances),
+                              wccp_reason_value("%u at most", WCCP_MAX_APPLIANCES));
     }
     uint64_t size;
-    if (!measure_view(group, pkt, elements_at, appliances, &size)) {
+    if (!measure_router_view(group, pkt, elements_at, appliances, &size)) {
         WCCP_COMPLAIN(LC_LOG_ERR,
                       "WCCP GRP %d: # of appliances (%u x %d bytes) does not fit in pkt length (%u)",
-                      group->id, appliances, shown(sizeof(wccp_wire_view_element_hash)), pkt->offset);
-        return refuse(group, pkt, wccp_reason_value("%u bytes for %u appliances", remaining(pkt), appliances),
-                      {}, WCCP_REASON_VIEW_LENGTH);
+                      group->id, appliances, clamp_to_int(sizeof(wccp_wire_view_element_hash)), pkt->offset);
+        return refuse_message(
+            group, pkt,
+            wccp_reason_value("%u bytes for %u appliances", count_remaining_bytes(pkt), appliances), {},
+            WCCP_REASON_VIEW_LENGTH);
     }
     if (to_host(view->head.length) != size - sizeof view->head) {
         WCCP_COMPLAIN(
             LC_LOG_ERR,
             "WCCP GRP %d: bad length. rxed length %d pkt length %d (check compatibility mode (IOS/Nexus))",
-            group->id, to_host(view->head.length), shown(size - sizeof view->head));
-        return refuse(group, pkt, wccp_reason_value("%u bytes", to_host(view->head.length)),
-                      wccp_reason_value("%d bytes", shown(size - sizeof view->head)),
-                      WCCP_REASON_VIEW_LENGTH);
+            group->id, to_host(view->head.length), clamp_to_int(size - sizeof view->head));
+        return refuse_message(group, pkt, wccp_reason_value("%u bytes", to_host(view->head.length)),
+                              wccp_reason_value("%d bytes", clamp_to_int(size - sizeof view->head)),
+                              WCCP_REASON_VIEW_LENGTH);
     }
     *out = {
         .change_number = view->change_number,
@@ -259,16 +267,17 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
         .routers = addresses,
         .appliances = {pkt->data + pkt->offset + elements_at, static_cast<uint32_t>(size - elements_at)},
     };
-    return pass(pkt, size);
+    return skip_bytes(pkt, size);
 }
 
 // The web-cache elements of a Router View.
 
+namespace {
+
 // Takes the bucket bits of an element over; the number of buckets that they assign. The bits are added up
 // side by side in one word: without a machine instruction for it, eight calls that count one word each would
 // be the most expensive step of a whole I-See-You.
-static uint16_t take_bucket_bits(const wccp_wire_view_element_hash *element,
-                                 wccp_rtr_view_appliance *decoded) {
+uint16_t decode_bucket_bits(const wccp_wire_view_element_hash *element, wccp_rtr_view_appliance *decoded) {
     uint64_t in_bytes = 0;
     for (uint32_t i = 0; i < 8; i += 2) {
         decoded->bucket_bits[i] = to_host(element->bucket_words[i]);
@@ -284,6 +293,8 @@ static uint16_t take_bucket_bits(const wccp_wire_view_element_hash *element,
     return decoded->buckets_assigned;
 }
 
+} // namespace
+
 int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, uint32_t count,
                                                    wccp_view_elements elements,
                                                    wccp_rtr_view_appliance *decoded,
@@ -295,14 +306,14 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
     uint64_t distance = 0;
     uint32_t total = 0;
     for (uint32_t i = 0; i < count; i++, decoded++) {
-        const auto *head = look<wccp_wire_view_element>(bytes, distance);
+        const auto *head = peek_layout<wccp_wire_view_element>(bytes, distance);
         if (!head)
             return 1;
         const uint16_t flags = to_host(head->flags);
         const wccp_element_shape shape = wccp_view_element_shape(flags, group->compat_mode);
         const bool by_hash = shape.form == WCCP_ELEMENT_HASH;
-        const auto *hash = by_hash ? look<wccp_wire_view_element_hash>(bytes, distance) : nullptr;
-        const auto *weight = look<be16>(bytes, distance + shape.weight_at);
+        const auto *hash = by_hash ? peek_layout<wccp_wire_view_element_hash>(bytes, distance) : nullptr;
+        const auto *weight = peek_layout<be16>(bytes, distance + shape.weight_at);
         if (!weight || (by_hash && !hash))
             return 1;
         decoded->ipa = head->web_cache_id;
@@ -318,7 +329,7 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
             QV_LOG(LC_LOG_INFO, "WCCP GRP %d: app id. %s assignment is historical, ignored", group->id,
                    addr_text(decoded->ipa).s);
         } else if (by_hash) {
-            const uint16_t assigned = take_bucket_bits(hash, decoded);
+            const uint16_t assigned = decode_bucket_bits(hash, decoded);
             if (decoded->ipa == group->appliance_ipa)
                 out_hash->self_count = assigned;
             total += assigned;
@@ -336,45 +347,46 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
     constexpr uint32_t smallest =
         sizeof(wccp_wire_assignment_map) + sizeof(wccp_wire_mask_element) + sizeof(wccp_wire_value_element);
     constexpr uint32_t head = sizeof(wccp_wire_component);
-    const auto *map = look<wccp_wire_assignment_map>(pkt);
-    if (!map || remaining(pkt) < smallest) {
+    const auto *map = peek_layout<wccp_wire_assignment_map>(pkt);
+    if (!map || count_remaining_bytes(pkt) < smallest) {
         WCCP_COMPLAIN(
             LC_LOG_ERR,
             "WCCP GRP %d: minimum assignment map (len = %d) does not fit in the packet. router src ip : "
             "%s ",
-            group->id, shown(smallest), addr_text(pkt->ipa).s);
-        return refuse_size(group, pkt, "an assignment map", remaining(pkt), smallest);
+            group->id, clamp_to_int(smallest), addr_text(pkt->ipa).s);
+        return refuse_message_size(group, pkt, "an assignment map", count_remaining_bytes(pkt), smallest);
     }
     const uint32_t declared = to_host(map->head.length);
     if (declared < smallest - head) {
         WCCP_COMPLAIN(LC_LOG_WARNING,
                       "WCCP GRP %d:  assignment map length: %d does not include at least one mask/value set "
                       "(expected minimum len: %d)  router src ip : %s ",
-                      group->id, shown(declared), shown(smallest - head), addr_text(pkt->ipa).s);
-        return refuse_size(group, pkt, "an assignment map", declared, smallest - head);
+                      group->id, clamp_to_int(declared), clamp_to_int(smallest - head),
+                      addr_text(pkt->ipa).s);
+        return refuse_message_size(group, pkt, "an assignment map", declared, smallest - head);
     }
     *out = {}; // a message may have two maps, and the last one counts
     out->element_count = to_host(map->mask_elements);
-    out->masks = look<wccp_wire_mask_element>(pkt, sizeof *map);
+    out->masks = peek_layout<wccp_wire_mask_element>(pkt, sizeof *map);
     uint64_t size = sizeof *map; // with the component's head
     for (uint32_t i = 0; i < out->element_count; i++) {
-        const auto *element = look<wccp_wire_mask_element>(pkt, size);
+        const auto *element = peek_layout<wccp_wire_mask_element>(pkt, size);
         const uint64_t values_at = size + sizeof *element;
         const uint64_t values = element ? to_host(element->values) : 0;
         size = values_at + values * sizeof(wccp_wire_value_element);
-        if (!element || size - head > declared || size > remaining(pkt)) {
+        if (!element || size - head > declared || size > count_remaining_bytes(pkt)) {
             WCCP_COMPLAIN(
                 LC_LOG_ERR,
                 "WCCP GRP %d: unload assignment map: packet length is BAD or it has bogus values. rxed "
                 "len: %d current len %d.",
-                group->id, shown(declared), shown(size - head));
-            return refuse_size(group, pkt, "an assignment map", declared, size - head);
+                group->id, clamp_to_int(declared), clamp_to_int(size - head));
+            return refuse_message_size(group, pkt, "an assignment map", declared, size - head);
         }
         out->value_count = static_cast<uint32_t>(values);
-        out->values = look<wccp_wire_value_element>(pkt, values_at, values);
+        out->values = peek_layout<wccp_wire_value_element>(pkt, values_at, values);
     }
     out->present = 1;
-    return pass(pkt, size);
+    return skip_bytes(pkt, size);
 }
 
 int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pkt *pkt,
@@ -389,25 +401,26 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
         {WCCP_CAP_RETURN, &wccp_rtr_capabilities::ret},
     };
     constexpr uint32_t element_size = sizeof(wccp_wire_capability_element);
-    const auto *head = look<wccp_wire_component>(pkt);
+    const auto *head = peek_layout<wccp_wire_component>(pkt);
     if (!head)
-        return refuse_size(group, pkt, "a capability info", remaining(pkt), sizeof *head);
+        return refuse_message_size(group, pkt, "a capability info", count_remaining_bytes(pkt), sizeof *head);
     const uint32_t length = to_host(head->length);
     if (length % element_size != 0) {
         WCCP_COMPLAIN(
             LC_LOG_ERR,
             "WCCP GRP %d: capability component length is not aligned. length %d individual element size "
             "%d",
-            group->id, shown(length), shown(element_size));
-        return refuse(group, pkt, wccp_reason_value("a capability info of %u bytes", length),
-                      wccp_reason_value("a multiple of %u", element_size));
+            group->id, clamp_to_int(length), clamp_to_int(element_size));
+        return refuse_message(group, pkt, wccp_reason_value("a capability info of %u bytes", length),
+                              wccp_reason_value("a multiple of %u", element_size));
     }
     if (length >= (std::size(known) + 1) * element_size)
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: more capabilities than are known. length %d", group->id,
-               shown(length));
-    const auto *element = look<wccp_wire_capability_element>(pkt, sizeof *head, length / element_size);
+               clamp_to_int(length));
+    const auto *element = peek_layout<wccp_wire_capability_element>(pkt, sizeof *head, length / element_size);
     if (!element)
-        return refuse_size(group, pkt, "a capability info", remaining(pkt), sizeof *head + length);
+        return refuse_message_size(group, pkt, "a capability info", count_remaining_bytes(pkt),
+                                   sizeof *head + length);
     for (uint32_t i = 0; i < length / element_size; i++, element++) {
         const capability *found = nullptr;
         for (const capability &each : known)
@@ -418,21 +431,22 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
         else
             group->rx_unknown_capabilities++;
     }
-    return pass(pkt, sizeof *head + length);
+    return skip_bytes(pkt, sizeof *head + length);
 }
 
 int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *pkt, wccp_command_info *out) {
     *out = {};
-    const auto *extension = look<wccp_wire_command_ext>(pkt);
+    const auto *extension = peek_layout<wccp_wire_command_ext>(pkt);
     if (!extension) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: no commands in pkt", group->id);
-        return refuse_size(group, pkt, "a command", remaining(pkt), sizeof *extension);
+        return refuse_message_size(group, pkt, "a command", count_remaining_bytes(pkt), sizeof *extension);
     }
     const uint32_t length = to_host(extension->head.length);
-    if (pass(pkt, sizeof extension->head + length)) {
+    if (skip_bytes(pkt, sizeof extension->head + length)) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bogus component length (%d): does not  fit in the packet.",
-                      group->id, shown(length));
-        return refuse_size(group, pkt, "a command", remaining(pkt), sizeof extension->head + length);
+                      group->id, clamp_to_int(length));
+        return refuse_message_size(group, pkt, "a command", count_remaining_bytes(pkt),
+                                   sizeof extension->head + length);
     }
     out->command = to_host(extension->command);
     out->data = to_host(extension->data);
@@ -440,20 +454,20 @@ int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *p
 }
 
 uint16_t wccp_pkt_next_component_type(const wccp_pkt *pkt) {
-    const auto *type = look<be16>(pkt);
+    const auto *type = peek_layout<be16>(pkt);
     return type ? to_host(*type) : 0;
 }
 
 int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt) {
-    const auto *head = look<wccp_wire_component>(pkt);
+    const auto *head = peek_layout<wccp_wire_component>(pkt);
     const int type = wccp_pkt_next_component_type(pkt), length = head ? to_host(head->length) : 0;
-    if (head && pass(pkt, sizeof *head + to_host(head->length)) == 0)
+    if (head && skip_bytes(pkt, sizeof *head + to_host(head->length)) == 0)
         return 0;
     WCCP_COMPLAIN(LC_LOG_ERR,
                   "WCCP GRP %d: unkown pkt length does not fit in the packet. component type: %d length %d ",
                   group->id, type, length);
-    return refuse(group, pkt, wccp_reason_value("component type %d of %d bytes", type, length),
-                  wccp_reason_value("%u bytes", remaining(pkt)));
+    return refuse_message(group, pkt, wccp_reason_value("component type %d of %d bytes", type, length),
+                          wccp_reason_value("%u bytes", count_remaining_bytes(pkt)));
 }
 
 // The one component of a Removal Query.
@@ -462,21 +476,21 @@ int wccp_pkt_unload_router_query_component(wccp_service_group *group, wccp_pkt *
                                            const wccp_wire_router_query **out) {
     constexpr uint32_t length = sizeof(wccp_wire_router_query) - sizeof(wccp_wire_component);
     *out = nullptr;
-    const auto *query = look<wccp_wire_router_query>(pkt);
+    const auto *query = peek_layout<wccp_wire_router_query>(pkt);
     if (!query) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: router query comp. does not fit in packet.", group->id);
-        return refuse_size(group, pkt, "a router query", remaining(pkt), sizeof *query);
+        return refuse_message_size(group, pkt, "a router query", count_remaining_bytes(pkt), sizeof *query);
     }
     if (to_host(query->head.type) != WCCP_ROUTER_QUERY_INFO) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad router query type rxed (%d)", group->id,
                       to_host(query->head.type));
-        return refuse_type(group, pkt, to_host(query->head.type), WCCP_ROUTER_QUERY_INFO);
+        return refuse_component_type(group, pkt, to_host(query->head.type), WCCP_ROUTER_QUERY_INFO);
     }
     if (to_host(query->head.length) != length) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bad length. rxed length %d pkt length %d", group->id,
-                      to_host(query->head.length), shown(length));
-        return refuse_size(group, pkt, "a router query", to_host(query->head.length), length);
+                      to_host(query->head.length), clamp_to_int(length));
+        return refuse_message_size(group, pkt, "a router query", to_host(query->head.length), length);
     }
     *out = query;
-    return pass(pkt, sizeof *query);
+    return skip_bytes(pkt, sizeof *query);
 }

@@ -10,20 +10,22 @@
 #include "runtime/common.h"
 #include "runtime/logging.h"
 
+namespace {
+
 template <size_t Size>
-static void put_text(char (&field)[Size], const char *text) {
+void copy_text(char (&field)[Size], const char *text) {
     strlcpy(field, text, Size);
 }
 
 // Value to word; a value past the table is "unknown".
 template <size_t Count>
-static const char *word_of(const char *const (&words)[Count], uint32_t value) {
+const char *find_word(const char *const (&words)[Count], uint32_t value) {
     return value < Count ? words[value] : "unknown";
 }
 
 // The place-th record of a list, counted from 1; the line, with group id and place, where there is none.
 template <typename T>
-static T *nth_or_tell(T *head, uint32_t place, const char *absent, int id) {
+T *find_nth_or_log(T *head, uint32_t place, const char *absent, int id) {
     for (uint32_t i = 1; head; head = head->next, i++)
         if (i == place)
             return head;
@@ -31,12 +33,14 @@ static T *nth_or_tell(T *head, uint32_t place, const char *absent, int id) {
     return nullptr;
 }
 
-static wccp_service_group *find_group_or_tell(int id) {
+wccp_service_group *find_group_or_log(int id) {
     wccp_service_group *group = wccp_find_group(id);
     if (!group)
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: cannot find group", id);
     return group;
 }
+
+} // namespace
 
 int wccp_get_grp_list(wccp_grp_list *list) {
     if (!list)
@@ -56,7 +60,7 @@ int wccp_get_grp_info(int id, wccp_grp_info *info) {
     if (!info)
         return 1;
     const wccp_engine_lock lock;
-    const wccp_service_group *group = find_group_or_tell(id);
+    const wccp_service_group *group = find_group_or_log(id);
     if (!group)
         return 1;
     info->appliance_ipa = group->appliance_ipa;
@@ -67,7 +71,7 @@ int wccp_get_grp_info(int id, wccp_grp_info *info) {
     info->pending_acks = group->pending_acks;
     const bool timed = (group->state_flags & (WCCP_STATE_ACTIVE | WCCP_STATE_BACKUP)) != 0;
     info->uptime = timed ? wccp_g.seconds - group->state_time : 0;
-    put_text(info->oper, state_words[group->state_flags & WCCP_STATE_MASK]);
+    copy_text(info->oper, state_words[group->state_flags & WCCP_STATE_MASK]);
     if (group->designated == 1)
         strlcat(info->oper, ", DESIGNATED", sizeof info->oper);
     return 0;
@@ -79,11 +83,11 @@ int wccp_get_grp_router_info(int id, wccp_grp_router_info *info) {
     if (!info)
         return 1;
     const wccp_engine_lock lock;
-    const wccp_service_group *group = find_group_or_tell(id);
+    const wccp_service_group *group = find_group_or_log(id);
     if (!group)
         return 1;
-    const wccp_sending_router *router = nth_or_tell(group->sending_routers, info->router_num,
-                                                    "WCCP GRP %d: Router number %d not present", id);
+    const wccp_sending_router *router = find_nth_or_log(group->sending_routers, info->router_num,
+                                                        "WCCP GRP %d: Router number %d not present", id);
     if (!router)
         return 0;
     info->router_id = router->router_id;
@@ -91,12 +95,12 @@ int wccp_get_grp_router_info(int id, wccp_grp_router_info *info) {
     info->conn_time = wccp_g.seconds - router->state_time;
     info->heard = wccp_g.seconds - router->last_icu_time;
     const bool agreed = (group->state_flags & WCCP_CAPABILITIES_SET) != 0;
-    put_text(info->fwd, agreed ? word_of(method_words, group->fwd_method) : "not-set");
-    put_text(info->ret, agreed ? word_of(method_words, group->ret_method) : "not-set");
-    put_text(info->assign, agreed ? word_of(assign_words, group->assign_method) : "not-set");
-    put_text(info->state, router->flags & WCCP_RTR_TWO_WAY   ? "TWO-WAY connected"
-                          : router->flags & WCCP_RTR_ONE_WAY ? "ONE-WAY connected"
-                                                             : "unknown");
+    copy_text(info->fwd, agreed ? find_word(method_words, group->fwd_method) : "not-set");
+    copy_text(info->ret, agreed ? find_word(method_words, group->ret_method) : "not-set");
+    copy_text(info->assign, agreed ? find_word(assign_words, group->assign_method) : "not-set");
+    copy_text(info->state, router->flags & WCCP_RTR_TWO_WAY   ? "TWO-WAY connected"
+                           : router->flags & WCCP_RTR_ONE_WAY ? "ONE-WAY connected"
+                                                              : "unknown");
     return 0;
 }
 
@@ -107,8 +111,8 @@ int wccp_get_grp_appliance_info(int id, wccp_grp_appliance_info *info) {
     const wccp_service_group *group = wccp_find_group(id);
     if (!group)
         return 0;
-    const wccp_view_appliance *appliance = nth_or_tell(group->appliance_view, info->appliance_num,
-                                                       "WCCP GRP %d: appliance number %d not present", id);
+    const wccp_view_appliance *appliance = find_nth_or_log(
+        group->appliance_view, info->appliance_num, "WCCP GRP %d: appliance number %d not present", id);
     if (!appliance)
         return 0;
     info->ipa = appliance->ipa;
@@ -122,15 +126,15 @@ wccp_sending_router *wccp_find_router_instance(int id, uint32_t router_num) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find router: cannot find group id %d", id, id);
         return nullptr;
     }
-    return nth_or_tell(group->sending_routers, router_num,
-                       "WCCP GRP %d: find router: router number %d not present", id);
+    return find_nth_or_log(group->sending_routers, router_num,
+                           "WCCP GRP %d: find router: router number %d not present", id);
 }
 
 int wccp_get_router_list(wccp_router_list *list) {
     if (!list)
         return 1;
     const wccp_engine_lock lock;
-    const wccp_service_group *group = find_group_or_tell(static_cast<int>(list->group_id));
+    const wccp_service_group *group = find_group_or_log(static_cast<int>(list->group_id));
     if (!group)
         return 1;
     list->count = 0;
@@ -179,19 +183,23 @@ int wccp_get_router_appliance_info(wccp_router_appliance_info *info) {
 
 // Reasons and counters.
 
+namespace {
+
 // The reasons of a group, or with WCCP_NO_GROUP those of no group; null when there is no such group. Lock
 // held.
-static const wccp_reason *find_reasons(int id, uint32_t *out_places) {
+const wccp_reason *find_reason_table(int id, uint32_t *out_places) {
     wccp_service_group *group = id == WCCP_NO_GROUP ? nullptr : wccp_find_group(id);
     return group || id == WCCP_NO_GROUP ? wccp_reasons_of(group, out_places) : nullptr;
 }
+
+} // namespace
 
 int wccp_get_reason_list(int id, wccp_reason_list *list) {
     if (!list)
         return 1;
     const wccp_engine_lock lock;
     uint32_t places;
-    const wccp_reason *const table = find_reasons(id, &places);
+    const wccp_reason *const table = find_reason_table(id, &places);
     if (!table)
         return 1;
     list->count = 0;
@@ -206,7 +214,7 @@ int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info) {
         return 1;
     const wccp_engine_lock lock;
     uint32_t places;
-    const wccp_reason *const table = find_reasons(id, &places);
+    const wccp_reason *const table = find_reason_table(id, &places);
     if (!table)
         return 1;
     *info = {};
@@ -218,7 +226,9 @@ int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info) {
     return 0;
 }
 
-static constexpr struct {
+namespace {
+
+constexpr struct {
     const char *word;
     uint32_t wccp_service_group::*member;
 } counter_rows[] = {
@@ -240,6 +250,8 @@ static constexpr struct {
     {"routers_timed_out", &wccp_service_group::routers_timed_out},
     {"transitions", &wccp_service_group::transitions},
 };
+
+} // namespace
 
 const char *wccp_counter_word(uint32_t index) {
     return index < sizeof counter_rows / sizeof *counter_rows ? counter_rows[index].word : nullptr;
@@ -269,7 +281,7 @@ int wccp_get_interface_info(uint32_t index, wccp_interface_info *info) {
     if (index >= wccp_g.if_count)
         return 1;
     const wccp_interface *from = &wccp_g.interfaces[index];
-    put_text(info->name, from->name);
+    copy_text(info->name, from->name);
     info->ipa = from->ipa;
     info->link_up = from->link_up;
     info->starts = from->start_count;

@@ -64,7 +64,7 @@ constexpr code_row code_rows[] = {
 };
 static_assert(sizeof code_rows / sizeof *code_rows == WCCP_REASON_CODES);
 
-bool knows_router(const wccp_service_group *group, be32 address) {
+bool group_has_router(const wccp_service_group *group, be32 address) {
     if (!group)
         return false;
     for (uint32_t i = 0; i < group->ucast_router_count; i++)
@@ -77,7 +77,7 @@ bool knows_router(const wccp_service_group *group, be32 address) {
 }
 
 // The place for one more reason: a free one, or that of the reason that gives way.
-wccp_reason *make_place(wccp_service_group *group) {
+wccp_reason *find_place_for_reason(wccp_service_group *group) {
     uint32_t count;
     wccp_reason *const table = wccp_reasons_of(group, &count), *chosen = table;
     for (wccp_reason *each = table; each < table + count; each++) {
@@ -129,12 +129,12 @@ void wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sen
                       const wccp_reason_text &offered, const wccp_reason_text &wanted) {
     wccp_reason *reason = find_reason(group, code, sender);
     if (!reason) {
-        reason = make_place(group);
+        reason = find_place_for_reason(group);
         *reason = {};
         reason->code = code;
         reason->sender = sender;
         reason->first = wccp_g.seconds;
-        reason->stranger = !is_zero(sender) && !knows_router(group, sender);
+        reason->stranger = !is_zero(sender) && !group_has_router(group, sender);
     }
     reason->count++;
     reason->last = wccp_g.seconds;

@@ -27,18 +27,22 @@
 #include "runtime/guards.h"
 #include "runtime/list.h"
 
-static constexpr uint32_t SILENCE_LIMIT = 40; // seconds without an I-See-You
-static constexpr uint8_t REPLY_TRANSMISSIONS = 3;
+namespace {
+
+constexpr uint32_t ROUTER_HOLD_SECONDS = 40; // seconds without an I-See-You
+constexpr uint8_t REPLY_TRANSMISSIONS = 3;
 // Of one router. Each reply holds a whole packet for three seconds, and anybody can send queries. With a
 // bound per router, queries in the name of one cannot keep the others from being answered.
-static constexpr uint32_t MAX_REPLIES_WAITING = 8;
+constexpr uint32_t MAX_REPLIES_WAITING = 8;
 
-static void free_router(wccp_sending_router *router) {
+void free_router(wccp_sending_router *router) {
     wccp_free(router);
 }
-static void free_reply(wccp_removal_reply *reply) {
+void free_reply(wccp_removal_reply *reply) {
     wccp_free(reply);
 }
+
+} // namespace
 
 wccp_sending_router *wccp_find_sending_router(wccp_service_group *group, be32 router_id) {
     for (wccp_sending_router *router = group->sending_routers; router; router = router->next)
@@ -65,7 +69,7 @@ struct capability_step {
 };
 
 // Only the two low bits of an offer mean anything, and as a bit set they are a method code.
-uint32_t offered_code(uint32_t word) {
+uint32_t get_offered_method(uint32_t word) {
     return word & WCCP_METHOD_EITHER;
 }
 
@@ -78,8 +82,8 @@ const capability_step capability_steps[] = {
              "WCCP GRP %d: incompatible capabilities (router id %s) : local: (fwd encap: %s ) router sent: "
              "(fwd: %s return: %s)",
              group, addr_text(router_id).s, wccp_method_name(local->forwarding),
-             wccp_method_name(offered_code(offered->forwarding)),
-             wccp_method_name(offered_code(offered->ret)));
+             wccp_method_name(get_offered_method(offered->forwarding)),
+             wccp_method_name(get_offered_method(offered->ret)));
      }},
     // Mask goes with L2, hash with GRE.
     {&capabilities::assignment,
@@ -93,7 +97,7 @@ const capability_step capability_steps[] = {
              "WCCP GRP %d: incompatible capabilities (router id %s) : local assign method: %s  router "
              "assign method: %s",
              group, addr_text(router_id).s, wccp_assign_method_name(local->assignment),
-             wccp_assign_method_name(offered_code(offered->assignment)));
+             wccp_assign_method_name(get_offered_method(offered->assignment)));
      }},
     {&capabilities::ret, [](const capabilities *) -> uint32_t { return WCCP_METHOD_GRE; }, 1,
      WCCP_REASON_RETURN_NOT_OFFERED, wccp_method_name,
@@ -103,15 +107,15 @@ const capability_step capability_steps[] = {
              "WCCP GRP %d: incompatible capabilities (router id %s) : local return method: %s  router "
              "return method: %s",
              group, addr_text(router_id).s, wccp_method_name(local->ret),
-             wccp_method_name(offered_code(offered->ret)));
+             wccp_method_name(get_offered_method(offered->ret)));
      }},
 };
 
 // The code that both sides can do, 0 for none.
-uint32_t common_code(uint32_t local, uint32_t offered, uint32_t preferred) {
+uint32_t choose_common_method(uint32_t local, uint32_t offered, uint32_t preferred) {
     if (local > WCCP_METHOD_EITHER)
         return WCCP_METHOD_NONE;
-    const uint32_t common = local & offered_code(offered);
+    const uint32_t common = local & get_offered_method(offered);
     return common == WCCP_METHOD_EITHER ? preferred : common;
 }
 
@@ -127,11 +131,12 @@ int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,
     const capabilities *local = group->state_flags & WCCP_CAPABILITIES_SET ? &in_force : &configured;
     capabilities agreed = {};
     for (const capability_step &step : capability_steps) {
-        agreed.*step.word = common_code(local->*step.word, offered->*step.word, step.preferred(&agreed));
+        agreed.*step.word =
+            choose_common_method(local->*step.word, offered->*step.word, step.preferred(&agreed));
         if (agreed.*step.word == WCCP_METHOD_NONE) {
             step.complain(group->id, router_id, local, offered);
             wccp_note_reason(group, step.reason, router_id,
-                             wccp_reason_value("%s", step.name(offered_code(offered->*step.word))),
+                             wccp_reason_value("%s", step.name(get_offered_method(offered->*step.word))),
                              wccp_reason_value("%s", step.name(local->*step.word)));
             return step.refusal;
         }
@@ -208,7 +213,7 @@ struct departing_router {
     wccp_sending_router *router;
 };
 
-void drop_views(wccp_service_group *group, wccp_sending_router *router) {
+void drop_view_references(wccp_service_group *group, wccp_sending_router *router) {
     for (uint32_t i = 0; i < router->view_router_count; i++)
         wccp_remove_router_from_view_list(group, router->view_routers[i].ipa);
     router->view_router_count = 0;
@@ -224,7 +229,7 @@ void remove_silent_router(wccp_service_group *group, wccp_sending_router *router
         const cancel_off_guard whole; // a line of the log must not part the record from its view entries
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removing router (router id: %s) due to inactivity.", group->id,
                addr_text(router->router_id).s);
-        drop_views(group, router);
+        drop_view_references(group, router);
     }
     if (router->flags & WCCP_RTR_HAS_TUNNEL)
         wccp_del_tunnel(group->id, group->appliance_ipa, router->router_id, 0);
@@ -251,26 +256,30 @@ int wccp_monitor_sending_routers(wccp_service_group *group) {
     wccp_sending_router *next;
     for (wccp_sending_router *router = group->sending_routers; router; router = next) {
         next = router->next;
-        if (wccp_g.seconds - router->last_icu_time < SILENCE_LIMIT)
+        if (wccp_g.seconds - router->last_icu_time < ROUTER_HOLD_SECONDS)
             continue;
         const be32 id = router->router_id;
         remove_silent_router(group, router);
         wccp_alarm_raise_router_down_alarm(group);
         group->routers_timed_out++;
         wccp_note_reason(group, WCCP_REASON_ROUTER_SILENT, id, {},
-                         wccp_reason_value("an I-See-You within %u s", SILENCE_LIMIT));
+                         wccp_reason_value("an I-See-You within %u s", ROUTER_HOLD_SECONDS));
     }
     return 0;
 }
 
 // Removal Queries.
 
-static uint32_t replies_waiting(const wccp_service_group *group, be32 router_id) {
+namespace {
+
+uint32_t count_waiting_replies(const wccp_service_group *group, be32 router_id) {
     uint32_t count = 0;
     for (const wccp_removal_reply *reply = group->removal_replies; reply; reply = reply->next)
         count += reply->pkt.ipa == router_id;
     return count;
 }
+
+} // namespace
 
 int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id, be32 receive_id) {
     wccp_sending_router *router = wccp_find_sending_router(group, router_id);
@@ -291,7 +300,7 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
         return 0;
     }
     router->receive_id = receive_id;
-    if (replies_waiting(group, router_id) >= MAX_REPLIES_WAITING) {
+    if (count_waiting_replies(group, router_id) >= MAX_REPLIES_WAITING) {
         QV_LOG(LC_LOG_INFO,
                "WCCP GRP %d: removal query request. maximum of waiting replies (%d) reached. (router id %s)",
                group->id, static_cast<int>(MAX_REPLIES_WAITING), addr_text(router_id).s);
@@ -340,7 +349,9 @@ int wccp_send_router_removal_query_reply(wccp_service_group *group) {
 
 // Questions about the routers.
 
-static bool assigns_to_another_appliance(const wccp_service_group *group, const wccp_sending_router *router) {
+namespace {
+
+bool assigns_to_another_appliance(const wccp_service_group *group, const wccp_sending_router *router) {
     for (uint32_t i = 0; i < router->view_appliance_count; i++) {
         const wccp_rtr_view_appliance *entry = &router->view_appliances[i];
         if (!(entry->ipa == group->appliance_ipa) && entry->buckets_assigned != 0)
@@ -348,6 +359,8 @@ static bool assigns_to_another_appliance(const wccp_service_group *group, const 
     }
     return false;
 }
+
+} // namespace
 
 int wccp_any_routers_redirecting_to_other_appliances(wccp_service_group *group,
                                                      const wccp_sending_router *router) {

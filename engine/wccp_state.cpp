@@ -29,10 +29,14 @@
 #include "engine/wccpd_common.h"
 #include "platform/qvcommon.h"
 
-static constexpr uint32_t ASSIGN_PERIOD = 10;         // seconds
-static constexpr uint32_t ASSIGN_DELAY_ELECTION = 16; // for the routers' views to settle
-static constexpr uint32_t ASSIGN_DELAY_WEIGHT_CHANGE = 1;
-static constexpr uint32_t LEFT_OUT_LOG_PERIOD = 60; // seconds
+namespace {
+
+constexpr uint32_t ASSIGN_PERIOD = 10;         // seconds
+constexpr uint32_t ASSIGN_DELAY_ELECTION = 16; // for the routers' views to settle
+constexpr uint32_t ASSIGN_DELAY_WEIGHT_CHANGE = 1;
+constexpr uint32_t LEFT_OUT_LOG_PERIOD = 60; // seconds
+
+} // namespace
 
 // The state.
 
@@ -49,16 +53,20 @@ int wccp_set_role_and_send_event(uint8_t id, uint32_t role) {
     return result;
 }
 
-static void make_only_state(wccp_service_group *group, uint32_t state) {
+namespace {
+
+void set_only_state(wccp_service_group *group, uint32_t state) {
     group->state_flags = (group->state_flags & ~WCCP_STATE_MASK) | state;
 }
+
+} // namespace
 
 int wccp_appliance_state_init(wccp_service_group *group) {
     if (group->state_flags & WCCP_STATE_INIT)
         return 0;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : INIT", group->id);
     wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP);
-    make_only_state(group, WCCP_STATE_INIT);
+    set_only_state(group, WCCP_STATE_INIT);
     return 0;
 }
 
@@ -68,7 +76,7 @@ int wccp_appliance_state_active(wccp_service_group *group) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : ACTIVE", group->id);
     wccp_set_role_and_send_event(group->id, WCCP_ROLE_ACTIVE);
     group->transitions++;
-    make_only_state(group, WCCP_STATE_ACTIVE);
+    set_only_state(group, WCCP_STATE_ACTIVE);
     group->state_time = wccp_g.seconds;
     return 0;
 }
@@ -79,7 +87,7 @@ int wccp_appliance_state_backup(wccp_service_group *group) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : BACKUP", group->id);
     wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP);
     group->transitions++;
-    make_only_state(group, WCCP_STATE_BACKUP);
+    set_only_state(group, WCCP_STATE_BACKUP);
     group->state_time = wccp_g.seconds;
     return 0;
 }
@@ -96,10 +104,11 @@ void wccp_clear_redirect_assign_states(wccp_service_group *group) {
     }
 }
 
+namespace {
+
 // Adds the appliances that all routers list to the assignment. Gives how many are left out, and how many of
 // these have had their line in the log.
-static void collect_eligible_appliances(wccp_service_group *group, uint32_t *out_left_out,
-                                        uint32_t *out_logged) {
+void collect_eligible_appliances(wccp_service_group *group, uint32_t *out_left_out, uint32_t *out_logged) {
     *out_left_out = *out_logged = 0;
     for (wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next) {
         if (wccp_appliance_is_reported_by_all_senders(group, entry->ipa)) {
@@ -121,7 +130,7 @@ static void collect_eligible_appliances(wccp_service_group *group, uint32_t *out
 // One I-See-You can bring 32 computations, and a thousand appliances can be left out of each. So an appliance
 // that is left out is logged once. When their set has changed all of it is logged again, but only once a
 // second, and when it has not, then after a minute.
-static void log_appliances_left_out(wccp_service_group *group, uint32_t left_out, uint32_t logged) {
+void log_appliances_left_out(wccp_service_group *group, uint32_t left_out, uint32_t logged) {
     const bool changed = logged != left_out || logged != group->not_listed_count;
     const uint32_t age = wccp_g.seconds - group->not_listed_time;
     const bool again = age >= LEFT_OUT_LOG_PERIOD || (changed && age != 0);
@@ -143,6 +152,8 @@ static void log_appliances_left_out(wccp_service_group *group, uint32_t left_out
         entry->listing = WCCP_NOT_LISTED_LOGGED;
     }
 }
+
+} // namespace
 
 int wccp_update_designated_redirect_assignment(wccp_service_group *group, int reason) {
     if (group->designated != 1) {
@@ -188,7 +199,9 @@ int wccp_update_designated_redirect_assignment(wccp_service_group *group, int re
 
 // The election.
 
-static bool every_router_is_two_way(wccp_service_group *group) {
+namespace {
+
+bool all_routers_are_two_way(wccp_service_group *group) {
     bool all = true;
     for (const wccp_view_router *entry = group->router_view; entry; entry = entry->next) {
         const wccp_sending_router *router = wccp_find_sending_router(group, entry->ipa);
@@ -203,7 +216,7 @@ static bool every_router_is_two_way(wccp_service_group *group) {
     return all;
 }
 
-static bool has_lower_appliance(const wccp_service_group *group) {
+bool has_lower_appliance(const wccp_service_group *group) {
     const uint32_t own = to_host(group->appliance_ipa);
     for (const wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next)
         if (to_host(entry->ipa) < own)
@@ -211,7 +224,7 @@ static bool has_lower_appliance(const wccp_service_group *group) {
     return false;
 }
 
-static int wccp_elect_designated_appliance(wccp_service_group *group) {
+int wccp_elect_designated_appliance(wccp_service_group *group) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: new designated selection.", group->id);
     group->state_flags &= ~WCCP_DESG_ELECT_PENDING;
     const uint32_t was_designated = group->designated;
@@ -223,7 +236,7 @@ static int wccp_elect_designated_appliance(wccp_service_group *group) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: appliance view is empty. try later.", group->id);
         return 0;
     }
-    if (!every_router_is_two_way(group)) {
+    if (!all_routers_are_two_way(group)) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: not selected (no ICUs)", group->id);
         return 0;
     }
@@ -242,8 +255,6 @@ static int wccp_elect_designated_appliance(wccp_service_group *group) {
 }
 
 // The tick.
-
-namespace {
 
 // A step is due when its timer fires, or without a timer when `pending` says so. A null `words` is a step
 // that can't fail.
@@ -273,7 +284,7 @@ const tick_step tick_steps[] = {
      wccp_alarms_verify_allocation_table},
 };
 
-bool timer_fires(wccp_timer *timer) {
+bool count_down_timer(wccp_timer *timer) {
     if (timer->active != 1)
         return false;
     if (timer->countdown > 1) {
@@ -294,7 +305,7 @@ bool timer_fires(wccp_timer *timer) {
 
 int wccp_process_timers(wccp_service_group *group) {
     for (const tick_step &step : tick_steps) {
-        const bool due = step.timer ? timer_fires(&(group->*step.timer)) : step.pending(group);
+        const bool due = step.timer ? count_down_timer(&(group->*step.timer)) : step.pending(group);
         if (due && step.action(group) && step.words)
             QV_LOG(LC_LOG_ERR, "WCCP GRP %u: %s failed.", group->id, step.words);
     }

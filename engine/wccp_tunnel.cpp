@@ -26,20 +26,22 @@
 #include "runtime/list.h"
 #include "runtime/logging.h"
 
-static pthread_mutex_t tunnel_mutex = PTHREAD_MUTEX_INITIALIZER;
-static wccp_tunnel *tunnel_list; // newest first
-static uint32_t tunnel_free_ids = 0xFFFFFFFF;
+namespace {
 
-static mailbox_address mailbox_address_of(be32 address) {
+pthread_mutex_t tunnel_mutex = PTHREAD_MUTEX_INITIALIZER;
+wccp_tunnel *tunnel_list; // newest first
+uint32_t tunnel_free_ids = 0xFFFFFFFF;
+
+mailbox_address to_mailbox_address(be32 address) {
     return {{to_host(address), 0}};
 }
 
-static void free_tunnel(wccp_tunnel *tunnel) {
+void free_tunnel(wccp_tunnel *tunnel) {
     wccp_free(tunnel);
 }
 
 // tunnel_mutex held.
-static wccp_tunnel *find_tunnel(be32 local, be32 remote) {
+wccp_tunnel *find_tunnel(be32 local, be32 remote) {
     for (wccp_tunnel *tunnel = tunnel_list; tunnel; tunnel = tunnel->next)
         if (tunnel->local_ipa == local && tunnel->remote_ipa == remote)
             return tunnel;
@@ -47,19 +49,17 @@ static wccp_tunnel *find_tunnel(be32 local, be32 remote) {
 }
 
 // tunnel_mutex held.
-static void give_id_back(uint32_t id) {
+void release_tunnel_id(uint32_t id) {
     if (id >= g_qv_encap_wccp_first && id <= g_qv_encap_wccp_last && id - g_qv_encap_wccp_first < 32)
         tunnel_free_ids |= 1u << (id - g_qv_encap_wccp_first);
 }
-
-namespace {
 
 // The id of an add that is under way. Given back unless the record that holds it made it into the table.
 struct owned_tunnel_id {
     ~owned_tunnel_id() {
         if (taken) {
             const mutex_guard guard(&tunnel_mutex);
-            give_id_back(id);
+            release_tunnel_id(id);
         }
     }
     bool take_lowest() {
@@ -83,7 +83,7 @@ struct tunnel_removal {
     explicit tunnel_removal(wccp_tunnel *removed) : tunnel(removed) {}
     ~tunnel_removal() {
         list_unlink(tunnel);
-        give_id_back(tunnel->tunnel_id);
+        release_tunnel_id(tunnel->tunnel_id);
         free_tunnel(tunnel);
     }
     tunnel_removal(const tunnel_removal &) = delete;
@@ -92,8 +92,8 @@ struct tunnel_removal {
 };
 
 // Of an add for the router of a group. Engine lock held.
-void note_failure(int group, wccp_reason_code code, be32 remote, const wccp_reason_text &offered,
-                  const wccp_reason_text &wanted) {
+void note_tunnel_failure(int group, wccp_reason_code code, be32 remote, const wccp_reason_text &offered,
+                         const wccp_reason_text &wanted) {
     if (wccp_service_group *record = wccp_find_group(group))
         wccp_note_reason(record, code, remote, offered, wanted);
 }
@@ -112,22 +112,22 @@ int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
     owned<wccp_tunnel, free_tunnel> tunnel(static_cast<wccp_tunnel *>(wccp_calloc(1, sizeof(wccp_tunnel))));
     if (!tunnel.pointer) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: Failed to alloc tunnel memory", group);
-        note_failure(group, WCCP_REASON_NO_MEMORY, remote, wccp_reason_value("its tunnel"), {});
+        note_tunnel_failure(group, WCCP_REASON_NO_MEMORY, remote, wccp_reason_value("its tunnel"), {});
         return 1;
     }
     tunnel.pointer->dataplane_index = WCCP_NO_INDEX;
     owned_tunnel_id id;
     if (!id.take_lowest()) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: No free tunnel id available", group);
-        note_failure(group, WCCP_REASON_TUNNEL_IDS_EXHAUSTED, remote, {},
-                     wccp_reason_value("ids %u to %u", g_qv_encap_wccp_first, g_qv_encap_wccp_last));
+        note_tunnel_failure(group, WCCP_REASON_TUNNEL_IDS_EXHAUSTED, remote, {},
+                            wccp_reason_value("ids %u to %u", g_qv_encap_wccp_first, g_qv_encap_wccp_last));
         return 1;
     }
     wccp_reason_code failure = WCCP_REASON_NONE;
-    if (wccp_add_tunnel_or_say_why(id.id, mailbox_address_of(local), mailbox_address_of(remote),
+    if (wccp_add_tunnel_or_say_why(id.id, to_mailbox_address(local), to_mailbox_address(remote),
                                    &tunnel.pointer->dataplane_index, &failure) == 1) {
-        note_failure(group, failure, remote, wccp_reason_value("tunnel id %d", id.id),
-                     wccp_reason_value("from %s", addr_text(local).s));
+        note_tunnel_failure(group, failure, remote, wccp_reason_value("tunnel id %d", id.id),
+                            wccp_reason_value("from %s", addr_text(local).s));
         WCCP_COMPLAIN(LC_LOG_NOTICE, "WCCP GRP %d: failed to add tunnel: id: %d %s <=> %s", group, id.id,
                       addr_text(local).s, addr_text(remote).s);
         return 1;
@@ -158,8 +158,8 @@ int wccp_del_tunnel(uint32_t group_id, be32 local, be32 remote, int force) {
     if (!force && tunnel->ref_count.fetch_sub(1) > 1)
         return 0;
     const tunnel_removal removal(tunnel);
-    const int result = wccp_del_tunnel_encap(tunnel->tunnel_id, mailbox_address_of(local),
-                                             mailbox_address_of(remote), &tunnel->dataplane_index);
+    const int result = wccp_del_tunnel_encap(tunnel->tunnel_id, to_mailbox_address(local),
+                                             to_mailbox_address(remote), &tunnel->dataplane_index);
     if (result != 1) {
         QV_LOG(LC_LOG_INFO, "WCCP%s: deleted GRE tunnel id: %d %s <=> %s", group, tunnel->tunnel_id,
                addr_text(local).s, addr_text(remote).s);
@@ -192,8 +192,8 @@ int wccp_restore_all_tunnels() {
     QV_LOG(LC_LOG_INFO, "WCCP: Restore all gre tunnels");
     const mutex_guard guard(&tunnel_mutex);
     for (wccp_tunnel *tunnel = tunnel_list; tunnel; tunnel = tunnel->next)
-        if (wccp_add_tunnel_encap(tunnel->tunnel_id, mailbox_address_of(tunnel->local_ipa),
-                                  mailbox_address_of(tunnel->remote_ipa), &tunnel->dataplane_index) == 1)
+        if (wccp_add_tunnel_encap(tunnel->tunnel_id, to_mailbox_address(tunnel->local_ipa),
+                                  to_mailbox_address(tunnel->remote_ipa), &tunnel->dataplane_index) == 1)
             QV_LOG(LC_LOG_NOTICE, "WCCP:retore tunnel: failed to create tunnel. id: %d %s <=> %s",
                    tunnel->tunnel_id, addr_text(tunnel->local_ipa).s, addr_text(tunnel->remote_ipa).s);
     return 0;

@@ -31,16 +31,20 @@
 #include "engine/wccp_utils.h"
 #include "runtime/list.h"
 
-static constexpr uint32_t MARK = 1;
+namespace {
+
+constexpr uint32_t MARK = 1;
 
 // The lists.
 
 template <typename Entry>
-static Entry *find_in_union(Entry *entry, be32 address) {
+Entry *find_view_entry(Entry *entry, be32 address) {
     while (entry && !(entry->ipa == address))
         entry = entry->next;
     return entry;
 }
+
+} // namespace
 
 int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_appliance *entry) {
     wccp_view_appliance *head = group->appliance_view;
@@ -63,11 +67,13 @@ int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_app
     return 0;
 }
 
+namespace {
+
 // Gives one reference on an entry of a union back, and frees the entry with the last one. False when there is
 // no entry of that address.
 template <typename Entry>
-static bool drop_reference(Entry *first, uint32_t *count, be32 address) {
-    Entry *entry = find_in_union(first, address);
+bool drop_reference(Entry *first, uint32_t *count, be32 address) {
+    Entry *entry = find_view_entry(first, address);
     if (!entry)
         return false;
     if (--entry->ref_count == 0) {
@@ -77,6 +83,8 @@ static bool drop_reference(Entry *first, uint32_t *count, be32 address) {
     }
     return true;
 }
+
+} // namespace
 
 int wccp_remove_router_from_view_list(wccp_service_group *group, be32 address) {
     if (drop_reference(group->router_view, &group->router_view_count, address))
@@ -96,7 +104,9 @@ int wccp_remove_appliance_from_view_list(wccp_service_group *group, be32 address
     return 1;
 }
 
-static void view_has_changed(wccp_service_group *group, const wccp_sending_router *router, const char *what) {
+namespace {
+
+void note_view_change(wccp_service_group *group, const wccp_sending_router *router, const char *what) {
     group->change_number++;
     group->state_flags |= WCCP_DESG_ELECT_PENDING;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: %s view has changed. sending router %s local change number %d",
@@ -105,21 +115,21 @@ static void view_has_changed(wccp_service_group *group, const wccp_sending_route
 
 // The reports.
 
-static be32 address_of(be32 address) {
+be32 get_address(be32 address) {
     return address;
 }
-static be32 address_of(const wccp_rtr_view_appliance &element) {
+be32 get_address(const wccp_rtr_view_appliance &element) {
     return element.ipa;
 }
 
 // Bit i is set when no item of the report before item i has the same address.
 template <typename Item>
-static uint32_t first_occurrences(const Item *items, uint32_t count) {
+uint32_t find_first_occurrences(const Item *items, uint32_t count) {
     static_assert(WCCP_MAX_ROUTERS <= 32 && WCCP_MAX_APPLIANCES <= 32);
     uint32_t bits = 0;
     for (uint32_t i = 0; i < count; i++) {
         uint32_t earlier = 0;
-        while (earlier < i && !(address_of(items[earlier]) == address_of(items[i])))
+        while (earlier < i && !(get_address(items[earlier]) == get_address(items[i])))
             earlier++;
         if (earlier == i)
             bits |= 1u << i;
@@ -129,7 +139,7 @@ static uint32_t first_occurrences(const Item *items, uint32_t count) {
 
 // The entry of an address in the last report, or null. `place` is where the new report has it.
 template <typename Entry>
-static Entry *find_in_report(Entry *entries, uint32_t count, uint32_t place, be32 address) {
+Entry *find_reported_entry(Entry *entries, uint32_t count, uint32_t place, be32 address) {
     if (place < count && entries[place].ipa == address)
         return &entries[place];
     for (uint32_t i = 0; i < count; i++)
@@ -139,14 +149,14 @@ static Entry *find_in_report(Entry *entries, uint32_t count, uint32_t place, be3
 }
 
 template <typename Entry>
-static void clear_marks(Entry *old, uint32_t count) {
+void clear_marks(Entry *old, uint32_t count) {
     for (uint32_t i = 0; i < count; i++)
         old[i].flags &= ~MARK;
 }
 
 // What a comparison leaves when every address of the report is known. A dump shows the marks.
 template <typename Entry>
-static void mark_all(Entry *old, uint32_t count) {
+void set_marks(Entry *old, uint32_t count) {
     for (uint32_t i = 0; i < count; i++)
         old[i].flags |= MARK;
 }
@@ -154,8 +164,8 @@ static void mark_all(Entry *old, uint32_t count) {
 // Routers.
 
 // Takes a reference on the union's entry of a router. False when memory is out.
-static bool hold_router(wccp_service_group *group, be32 address) {
-    wccp_view_router *entry = find_in_union(group->router_view, address);
+bool add_router_reference(wccp_service_group *group, be32 address) {
+    wccp_view_router *entry = find_view_entry(group->router_view, address);
     if (!entry) {
         entry = static_cast<wccp_view_router *>(wccp_malloc(sizeof *entry));
         if (!entry) {
@@ -172,7 +182,7 @@ static bool hold_router(wccp_service_group *group, be32 address) {
     return true;
 }
 
-static bool repeats_last_report(const wccp_sending_router *router, uint32_t count, const be32 *addresses) {
+bool repeats_last_report(const wccp_sending_router *router, uint32_t count, const be32 *addresses) {
     if (count != router->view_router_count)
         return false;
     for (uint32_t i = 0; i < count; i++)
@@ -181,25 +191,28 @@ static bool repeats_last_report(const wccp_sending_router *router, uint32_t coun
     return true;
 }
 
+} // namespace
+
 int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                             const be32 *addresses) {
     if (count > WCCP_MAX_ROUTERS)
         return 1;
     if (repeats_last_report(router, count, addresses)) {
-        mark_all(router->view_routers, count);
+        set_marks(router->view_routers, count);
         return 0;
     }
     const uint32_t old_count = router->view_router_count;
-    uint32_t taken = first_occurrences(addresses, count);
+    uint32_t taken = find_first_occurrences(addresses, count);
     bool changed = false;
     int status = 0;
     clear_marks(router->view_routers, old_count);
     for (uint32_t i = 0; i < count; i++) {
         if (!(taken >> i & 1))
             continue;
-        if (wccp_rtr_view_router *known = find_in_report(router->view_routers, old_count, i, addresses[i])) {
+        if (wccp_rtr_view_router *known =
+                find_reported_entry(router->view_routers, old_count, i, addresses[i])) {
             known->flags |= MARK;
-        } else if (hold_router(group, addresses[i])) {
+        } else if (add_router_reference(group, addresses[i])) {
             changed = true;
         } else {
             taken &= ~(1u << i);
@@ -217,15 +230,17 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
         if (taken >> i & 1)
             router->view_routers[router->view_router_count++].ipa = addresses[i];
     if (changed)
-        view_has_changed(group, router, "router");
+        note_view_change(group, router, "router");
     return status;
 }
 
 // Appliances.
 
+namespace {
+
 // A router reports another weight than it did before.
-static int take_reported_weight(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
-    wccp_view_appliance *entry = find_in_union(group->appliance_view, element->ipa);
+int apply_reported_weight(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
+    wccp_view_appliance *entry = find_view_entry(group->appliance_view, element->ipa);
     if (!entry) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: update appliance view list failed. cannot find appliance %s",
                group->id, addr_text(element->ipa).s);
@@ -249,8 +264,8 @@ static int take_reported_weight(wccp_service_group *group, const wccp_rtr_view_a
 }
 
 // Takes a reference on the union's entry of an appliance. False when memory is out.
-static bool hold_appliance(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
-    wccp_view_appliance *entry = find_in_union(group->appliance_view, element->ipa);
+bool add_appliance_reference(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
+    wccp_view_appliance *entry = find_view_entry(group->appliance_view, element->ipa);
     if (!entry) {
         entry = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof *entry));
         if (!entry) {
@@ -269,7 +284,7 @@ static bool hold_appliance(wccp_service_group *group, const wccp_rtr_view_applia
     return true;
 }
 
-static void router_has_seen_us(wccp_service_group *group, wccp_sending_router *router) {
+void set_two_way(wccp_service_group *group, wccp_sending_router *router) {
     router->flags = (router->flags & ~WCCP_RTR_ONE_WAY) | WCCP_RTR_TWO_WAY;
     router->state_time = wccp_g.seconds;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: router id %s is TWO-WAY connected.", group->id,
@@ -277,7 +292,7 @@ static void router_has_seen_us(wccp_service_group *group, wccp_sending_router *r
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 0);
 }
 
-static void router_has_lost_us(wccp_service_group *group, wccp_sending_router *router) {
+void set_one_way(wccp_service_group *group, wccp_sending_router *router) {
     router->flags = (router->flags & ~WCCP_RTR_TWO_WAY) | WCCP_RTR_ONE_WAY;
     router->state_time = wccp_g.seconds;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d router id %s is ONE-WAY connected.", group->id,
@@ -286,8 +301,8 @@ static void router_has_lost_us(wccp_service_group *group, wccp_sending_router *r
 }
 
 // The same appliances with the same weights, in the same order: nothing moves but what is assigned to them.
-static bool repeats_last_report(const wccp_sending_router *router, uint32_t count,
-                                const wccp_rtr_view_appliance *decoded) {
+bool repeats_last_report(const wccp_sending_router *router, uint32_t count,
+                         const wccp_rtr_view_appliance *decoded) {
     if (count != router->view_appliance_count)
         return false;
     for (uint32_t i = 0; i < count; i++) {
@@ -299,8 +314,8 @@ static bool repeats_last_report(const wccp_sending_router *router, uint32_t coun
 }
 
 // The elements whose bit is set in `taken` become the router's last report.
-static void copy_report(wccp_sending_router *router, uint32_t count, const wccp_rtr_view_appliance *decoded,
-                        uint32_t taken) {
+void store_appliance_report(wccp_sending_router *router, uint32_t count,
+                            const wccp_rtr_view_appliance *decoded, uint32_t taken) {
     router->view_appliance_count = 0;
     for (uint32_t i = 0; i < count; i++) {
         if (!(taken >> i & 1))
@@ -317,31 +332,31 @@ static void copy_report(wccp_sending_router *router, uint32_t count, const wccp_
 
 // Moves the union and the connection by what is new in a report and what is gone. Gives back which elements
 // were taken, a bit for each, and whether the view has changed.
-static int take_changes(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
-                        const wccp_rtr_view_appliance *decoded, uint32_t *out_taken, bool *out_changed) {
+int apply_appliance_report(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
+                           const wccp_rtr_view_appliance *decoded, uint32_t *out_taken, bool *out_changed) {
     const uint32_t old_count = router->view_appliance_count;
     wccp_rtr_view_appliance *const old = router->view_appliances;
     int status = 0;
-    *out_taken = first_occurrences(decoded, count);
+    *out_taken = find_first_occurrences(decoded, count);
     clear_marks(old, old_count);
     for (uint32_t i = 0; i < count; i++) {
         const wccp_rtr_view_appliance *element = &decoded[i];
         if (!(*out_taken >> i & 1))
             continue;
-        if (wccp_rtr_view_appliance *known = find_in_report(old, old_count, i, element->ipa)) {
+        if (wccp_rtr_view_appliance *known = find_reported_entry(old, old_count, i, element->ipa)) {
             known->flags |= MARK;
-            if (known->weight != element->weight && take_reported_weight(group, element))
+            if (known->weight != element->weight && apply_reported_weight(group, element))
                 status = 1;
             continue;
         }
-        if (!hold_appliance(group, element)) {
+        if (!add_appliance_reference(group, element)) {
             *out_taken &= ~(1u << i);
             status = 1;
             continue;
         }
         *out_changed = true;
         if (element->ipa == group->appliance_ipa)
-            router_has_seen_us(group, router);
+            set_two_way(group, router);
     }
     for (uint32_t i = 0; i < old_count; i++) {
         if (old[i].flags & MARK)
@@ -349,10 +364,12 @@ static int take_changes(wccp_service_group *group, wccp_sending_router *router, 
         wccp_remove_appliance_from_view_list(group, old[i].ipa);
         *out_changed = true;
         if (old[i].ipa == group->appliance_ipa)
-            router_has_lost_us(group, router);
+            set_one_way(group, router);
     }
     return status;
 }
+
+} // namespace
 
 int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                                const wccp_rtr_view_appliance *decoded) {
@@ -362,12 +379,12 @@ int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *r
     bool changed = false;
     int status = 0;
     if (repeats_last_report(router, count, decoded))
-        mark_all(router->view_appliances, count);
+        set_marks(router->view_appliances, count);
     else
-        status = take_changes(group, router, count, decoded, &taken, &changed);
-    copy_report(router, count, decoded, taken);
+        status = apply_appliance_report(group, router, count, decoded, &taken, &changed);
+    store_appliance_report(router, count, decoded, taken);
     if (changed)
-        view_has_changed(group, router, "appliance");
+        note_view_change(group, router, "appliance");
     return status;
 }
 
@@ -387,20 +404,22 @@ int wccp_appliance_is_reported_by_all_senders(wccp_service_group *group, be32 ad
 
 // The role.
 
+namespace {
+
 // Enters a state for the reason that `line` gives, with the group's number and the router's id.
-static void enter_state(wccp_service_group *group, const wccp_sending_router *router, const char *line,
-                        int (*enter)(wccp_service_group *)) {
+void enter_state(wccp_service_group *group, const wccp_sending_router *router, const char *line,
+                 int (*enter)(wccp_service_group *)) {
     QV_LOG(LC_LOG_INFO, line, group->id, addr_text(router->router_id).s);
     enter(group);
 }
 
-static void router_redirects_here(wccp_service_group *group, const wccp_sending_router *router) {
+void handle_redirect_here(wccp_service_group *group, const wccp_sending_router *router) {
     if (++group->redirecting_routers == 1)
         enter_state(group, router, "WCCP GRP %d: redirect: first router to self (router id %s )",
                     wccp_appliance_state_active);
 }
 
-static void router_redirects_elsewhere(wccp_service_group *group, const wccp_sending_router *router) {
+void handle_redirect_elsewhere(wccp_service_group *group, const wccp_sending_router *router) {
     if (group->state_flags & WCCP_STATE_INIT)
         enter_state(group, router,
                     "WCCP GRP %d: redirect: router id %s is redirecting to other  appliance(s).",
@@ -408,8 +427,8 @@ static void router_redirects_elsewhere(wccp_service_group *group, const wccp_sen
 }
 
 // `elsewhere`: to other appliances, instead of to nobody.
-static void router_stopped_redirecting_here(wccp_service_group *group, const wccp_sending_router *router,
-                                            bool elsewhere) {
+void handle_end_of_redirect_here(wccp_service_group *group, const wccp_sending_router *router,
+                                 bool elsewhere) {
     if (group->redirecting_routers != 0)
         group->redirecting_routers--;
     if (group->redirecting_routers != 0)
@@ -428,8 +447,7 @@ static void router_stopped_redirecting_here(wccp_service_group *group, const wcc
                     wccp_appliance_state_init);
 }
 
-static void router_stopped_redirecting_elsewhere(wccp_service_group *group,
-                                                 const wccp_sending_router *router) {
+void handle_end_of_redirect_elsewhere(wccp_service_group *group, const wccp_sending_router *router) {
     if (group->state_flags & WCCP_STATE_BACKUP &&
         !wccp_any_routers_redirecting_to_other_appliances(group, router))
         enter_state(group, router, "WCCP GRP %d: redirect: no routers redirecting to group (router id %s)",
@@ -438,20 +456,22 @@ static void router_stopped_redirecting_elsewhere(wccp_service_group *group,
 
 // The router already holds what it assigns now; the numbers are what it assigned before, to this appliance
 // and to anybody, and at least one of them differs.
-static void take_redirection(wccp_service_group *group, const wccp_sending_router *router,
-                             uint16_t self_before, uint16_t total_before) {
+void apply_redirect_change(wccp_service_group *group, const wccp_sending_router *router, uint16_t self_before,
+                           uint16_t total_before) {
     const bool here = router->self_buckets != 0, anywhere = router->total_buckets != 0;
     if (here) {
         if (self_before == 0)
-            router_redirects_here(group, router);
+            handle_redirect_here(group, router);
     } else if (anywhere && total_before == 0) {
-        router_redirects_elsewhere(group, router);
+        handle_redirect_elsewhere(group, router);
     } else if (self_before != 0) {
-        router_stopped_redirecting_here(group, router, anywhere);
+        handle_end_of_redirect_here(group, router, anywhere);
     } else if (!anywhere) {
-        router_stopped_redirecting_elsewhere(group, router);
+        handle_end_of_redirect_elsewhere(group, router);
     }
 }
+
+} // namespace
 
 int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sending_router *router,
                                           const wccp_assign_summary *hash, const wccp_assign_summary *mask) {
@@ -477,6 +497,6 @@ int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sendin
     wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
     router->self_buckets = now->self_count;
     router->total_buckets = now->total_count;
-    take_redirection(group, router, self_before, total_before);
+    apply_redirect_change(group, router, self_before, total_before);
     return 0;
 }

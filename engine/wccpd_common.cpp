@@ -41,27 +41,25 @@
 #include "runtime/logging.h"
 #include "runtime/ttime.h"
 
-static pthread_mutex_t mailbox_mutex = PTHREAD_MUTEX_INITIALIZER;
-static std::atomic<bool> abandon;
-static wccp_tunnel_mailbox *created_mailbox; // null until this process has created the block
-
-static constexpr int ANSWER_POLLS = 2000;    // of a millisecond
-static constexpr int64_t SILENCE_MS = 10000; // until a tunneld that was silent is tried again
-
 namespace {
 
+pthread_mutex_t mailbox_mutex = PTHREAD_MUTEX_INITIALIZER;
+std::atomic<bool> abandon;
+wccp_tunnel_mailbox *created_mailbox; // null until this process has created the block
+
+constexpr int ANSWER_POLLS = 2000;        // of a millisecond
+constexpr int64_t RETRY_AFTER_MS = 10000; // until a tunneld that was silent is tried again
+
 // The last command that timed out, until tunneld answers another.
-struct tunneld_silence {
+struct unanswered_command {
     uint16_t code; // MAILBOX_IDLE: there is none
     bool during_exit;
     int64_t since_ms;
 };
-tunneld_silence silence; // mailbox_mutex
-
-} // namespace
+unanswered_command unanswered; // mailbox_mutex
 
 // mailbox_mutex held.
-static void reset_block(wccp_tunnel_mailbox *mailbox, uint32_t index) {
+void reset_mailbox(wccp_tunnel_mailbox *mailbox, uint32_t index) {
     mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
     mailbox_put(mailbox->tunnel_id, uint16_t{0});
     mailbox_put(mailbox->status, 0u);
@@ -79,6 +77,8 @@ static void reset_block(wccp_tunnel_mailbox *mailbox, uint32_t index) {
     }
 }
 
+} // namespace
+
 int wccp_init_shmem() {
     constexpr uint32_t length = sizeof(wccp_tunnel_mailbox);
     auto *mailbox = static_cast<wccp_tunnel_mailbox *>(cmem_create_block(length, WCCP_MAILBOX_NAME));
@@ -88,8 +88,8 @@ int wccp_init_shmem() {
     }
     {
         const mutex_guard guard(&mailbox_mutex);
-        reset_block(mailbox, WCCP_NO_INDEX);
-        silence = {};
+        reset_mailbox(mailbox, WCCP_NO_INDEX);
+        unanswered = {};
         mailbox_put(wccp_mailbox, mailbox);
         mailbox_put(created_mailbox, mailbox);
     }
@@ -112,7 +112,7 @@ int wccp_cleanup_shmem() {
     wccp_init_policy_grp_mgr();
     abandon.store(true, std::memory_order_release);
     const mutex_guard guard(&mailbox_mutex);
-    reset_block(mailbox, 0);
+    reset_mailbox(mailbox, 0);
     abandon.store(false, std::memory_order_release);
     return 0;
 }
@@ -139,17 +139,17 @@ const command_kind set_l2_return = {MAILBOX_L2_RETURN, LC_LOG_ERR, "GRE tunnel L
 enum class effort { NONE, GIVE, GIVE_AND_WAIT };
 
 // What is done about a command. mailbox_mutex held.
-effort effort_for(uint16_t code, const wccp_tunnel_mailbox *mailbox) {
+effort choose_effort(uint16_t code, const wccp_tunnel_mailbox *mailbox) {
     const bool exiting = wccpd_shutdown_in_progress() == 1;
-    if (silence.code == MAILBOX_IDLE || (exiting && !silence.during_exit))
+    if (unanswered.code == MAILBOX_IDLE || (exiting && !unanswered.during_exit))
         return effort::GIVE_AND_WAIT;
-    const bool cleared = silence.code != MAILBOX_ADD_TUNNEL &&
+    const bool cleared = unanswered.code != MAILBOX_ADD_TUNNEL &&
                          mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE;
-    if (!exiting && (cleared || lt_monotonic_ms() - silence.since_ms >= SILENCE_MS))
+    if (!exiting && (cleared || lt_monotonic_ms() - unanswered.since_ms >= RETRY_AFTER_MS))
         return effort::GIVE_AND_WAIT;
     if (code != MAILBOX_DELETE_TUNNEL)
         return effort::NONE;
-    return exiting || silence.code == MAILBOX_DELETE_TUNNEL ? effort::GIVE : effort::GIVE_AND_WAIT;
+    return exiting || unanswered.code == MAILBOX_DELETE_TUNNEL ? effort::GIVE : effort::GIVE_AND_WAIT;
 }
 
 void write_command(wccp_tunnel_mailbox *mailbox, uint16_t code, const mailbox_inputs *inputs) {
@@ -201,14 +201,14 @@ wait_end wait_for_answer(wccp_tunnel_mailbox *mailbox, uint16_t code) {
 
 // Gives the command and waits, unless it is refused. True when tunneld has answered; its answer is then in
 // the outputs. Otherwise `out_failure` says why not.
-bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_t *out_status,
-                  uint32_t *out_index, wccp_reason_code *out_failure) {
+bool run_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_t *out_status,
+                 uint32_t *out_index, wccp_reason_code *out_failure) {
     const mutex_guard guard(&mailbox_mutex);
     wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
     *out_failure = WCCP_REASON_MAILBOX_MISSING;
     if (!mailbox)
         return false;
-    const effort made = effort_for(kind->code, mailbox);
+    const effort made = choose_effort(kind->code, mailbox);
     if (made != effort::NONE)
         write_command(mailbox, kind->code, inputs);
     *out_failure = made == effort::GIVE_AND_WAIT ? WCCP_REASON_TUNNEL_TIMEOUT : WCCP_REASON_TUNNELD_SILENT;
@@ -216,20 +216,20 @@ bool give_command(const command_kind *kind, const mailbox_inputs *inputs, uint32
     if (made == effort::GIVE_AND_WAIT) {
         end = wait_for_answer(mailbox, kind->code);
         if (end == wait_end::TIMED_OUT)
-            silence = {kind->code, wccpd_shutdown_in_progress() == 1, lt_monotonic_ms()};
+            unanswered = {kind->code, wccpd_shutdown_in_progress() == 1, lt_monotonic_ms()};
     }
     if (end == wait_end::TIMED_OUT)
         WCCP_COMPLAIN(kind->time_out_level, "%s", kind->time_out_line);
     if (end != wait_end::ANSWERED)
         return false;
-    silence = {};
+    unanswered = {};
     *out_status = mailbox_get(mailbox->status);
     *out_index = mailbox_get(mailbox->fmst_index);
     return true;
 }
 
-mailbox_inputs tunnel_inputs(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
-                             uint32_t index) {
+mailbox_inputs make_tunnel_inputs(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
+                                  uint32_t index) {
     return {.tunnel_id = tunnel_id,
             .local_ip = static_cast<uint32_t>(local.words[0]),
             .remote_ip = static_cast<uint32_t>(remote.words[0]),
@@ -248,9 +248,9 @@ int wccp_add_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_add
 
 int wccp_add_tunnel_or_say_why(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
                                uint32_t *inout_index, wccp_reason_code *out_failure) {
-    const mailbox_inputs inputs = tunnel_inputs(tunnel_id, local, remote, *inout_index);
+    const mailbox_inputs inputs = make_tunnel_inputs(tunnel_id, local, remote, *inout_index);
     uint32_t status, index;
-    if (!give_command(&add_tunnel, &inputs, &status, &index, out_failure))
+    if (!run_command(&add_tunnel, &inputs, &status, &index, out_failure))
         return 1;
     *out_failure = WCCP_REASON_TUNNEL_REFUSED; // if it is one
     *inout_index = index;
@@ -259,10 +259,10 @@ int wccp_add_tunnel_or_say_why(uint16_t tunnel_id, mailbox_address local, mailbo
 
 int wccp_del_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
                           uint32_t *inout_index) {
-    const mailbox_inputs inputs = tunnel_inputs(tunnel_id, local, remote, *inout_index);
+    const mailbox_inputs inputs = make_tunnel_inputs(tunnel_id, local, remote, *inout_index);
     uint32_t status, index;
     wccp_reason_code unused;
-    if (!give_command(&delete_tunnel, &inputs, &status, &index, &unused))
+    if (!run_command(&delete_tunnel, &inputs, &status, &index, &unused))
         return 1;
     *inout_index = index;
     return static_cast<int>(status);
@@ -274,7 +274,7 @@ int wccp_set_L2_return(uint8_t group_id, uint32_t value) {
     inputs.l2_value = value;
     uint32_t status, index;
     wccp_reason_code unused;
-    if (!give_command(&set_l2_return, &inputs, &status, &index, &unused))
+    if (!run_command(&set_l2_return, &inputs, &status, &index, &unused))
         return 1;
     return static_cast<int>(status);
 }

@@ -29,7 +29,7 @@ struct policy_grp_set { // one policy group with members
 struct service_roles {
     uint32_t of[SERVICE_GROUPS];
 };
-constexpr service_roles all_unknown() {
+constexpr service_roles make_unknown_roles() {
     service_roles roles = {};
     for (uint32_t &role : roles.of)
         role = 2;
@@ -38,12 +38,12 @@ constexpr service_roles all_unknown() {
 
 pthread_mutex_t policy_mutex = PTHREAD_MUTEX_INITIALIZER;
 // All below: policy_mutex.
-service_roles svc_role = all_unknown();
+service_roles svc_role = make_unknown_roles();
 uint16_t svc_policy_grp[SERVICE_GROUPS]; // 0 for none
 policy_grp_set *policy_grp_members;
 uint32_t policy_grp_count, policy_grp_room;
 
-policy_grp_set *find_members(uint16_t policy) {
+policy_grp_set *find_member_set(uint16_t policy) {
     for (uint32_t i = 0; i < policy_grp_count; i++)
         if (policy_grp_members[i].policy == policy)
             return &policy_grp_members[i];
@@ -54,8 +54,8 @@ bool is_member(const policy_grp_set *set, uint32_t id) {
     return set && ((set->bits[id / 8] >> (id % 8)) & 1) != 0;
 }
 
-policy_grp_set *find_or_make_members(uint16_t policy) {
-    if (policy_grp_set *set = find_members(policy))
+policy_grp_set *find_or_add_member_set(uint16_t policy) {
+    if (policy_grp_set *set = find_member_set(policy))
         return set;
     if (policy_grp_count == policy_grp_room) {
         const uint32_t room = policy_grp_room ? policy_grp_room * 2 : 16;
@@ -71,23 +71,23 @@ policy_grp_set *find_or_make_members(uint16_t policy) {
     return set;
 }
 
-void forget_members(policy_grp_set *set) {
+void remove_member_set(policy_grp_set *set) {
     *set = policy_grp_members[--policy_grp_count];
 }
 
 void remove_member(uint16_t policy, uint8_t id) {
-    policy_grp_set *set = find_members(policy);
+    policy_grp_set *set = find_member_set(policy);
     if (!set)
         return;
     set->bits[id / 8] = static_cast<uint8_t>(set->bits[id / 8] & ~(1u << (id % 8)));
     for (const uint8_t byte : set->bits)
         if (byte)
             return;
-    forget_members(set);
+    remove_member_set(set);
 }
 
 // The role that the members give a policy group: a member whose role is unknown counts like a backup.
-uint32_t role_of_members(const policy_grp_set *set) {
+uint32_t derive_policy_role(const policy_grp_set *set) {
     if (!set)
         return WCCP_ROLE_UNKNOWN;
     for (uint32_t id = 0; id < SERVICE_GROUPS; id++)
@@ -98,7 +98,7 @@ uint32_t role_of_members(const policy_grp_set *set) {
 
 void update_policy_role(uint16_t policy) {
     static const char *const names[] = {"ACTIVE", "BACKUP", "UNKNOWN"};
-    const uint32_t role = role_of_members(find_members(policy));
+    const uint32_t role = derive_policy_role(find_member_set(policy));
     if (wccp_publish_policy_role(policy, role))
         QV_LOG(LC_LOG_DEBUG, "WCCP: Update policy group %d role to %s", policy, names[role]);
 }
@@ -110,7 +110,7 @@ int wccp_init_policy_grp_mgr() {
     free(policy_grp_members);
     policy_grp_members = nullptr;
     policy_grp_count = policy_grp_room = 0;
-    svc_role = all_unknown();
+    svc_role = make_unknown_roles();
     memset(svc_policy_grp, 0, sizeof svc_policy_grp);
     return 0;
 }
@@ -120,7 +120,7 @@ int wccp_add_policy_grp(uint16_t policy, uint32_t count, const uint8_t *ids) {
     int result = 0;
     for (uint32_t i = 0; i < count; i++) {
         const uint8_t id = ids[i];
-        policy_grp_set *set = find_or_make_members(policy);
+        policy_grp_set *set = find_or_add_member_set(policy);
         if (!set) {
             QV_LOG(LC_LOG_ERR, "WCCP: No memory to add Service group %d to Policy group %d", id, policy);
             result = 1;
@@ -145,11 +145,11 @@ int wccp_remove_policy_grp(uint16_t policy, uint8_t id) {
 
 int wccp_del_entire_policy_grp(uint16_t policy) {
     const mutex_guard guard(&policy_mutex);
-    if (policy_grp_set *set = find_members(policy)) {
+    if (policy_grp_set *set = find_member_set(policy)) {
         for (uint32_t id = 0; id < SERVICE_GROUPS; id++)
             if (is_member(set, id))
                 svc_policy_grp[id] = 0;
-        forget_members(set);
+        remove_member_set(set);
     }
     QV_LOG(LC_LOG_DEBUG, "WCCP: Delete Policy group %d", policy);
     update_policy_role(policy);
@@ -158,7 +158,7 @@ int wccp_del_entire_policy_grp(uint16_t policy) {
 
 int wccp_check_policy_group(uint16_t policy, uint8_t id) {
     const mutex_guard guard(&policy_mutex);
-    return is_member(find_members(policy), id) ? 1 : 0;
+    return is_member(find_member_set(policy), id) ? 1 : 0;
 }
 
 int wccp_set_role(uint8_t id, uint32_t role) {
