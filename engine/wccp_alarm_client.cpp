@@ -222,7 +222,6 @@ lc_status qv_initiate_exit() {
 
 // The engine's threads still run; a sender among them finds the session whole or gone.
 lc_status qv_alm_mgmt_deinit() {
-    const cancel_off_guard uncancelled;
     const mutex_guard guard(&qv_alm_session_mutex);
     qv_alm_mgmt_session = nullptr;
     mgmt_client_deinit(&qv_alm_client);

@@ -93,7 +93,6 @@ struct event_field {
 // is off meanwhile.
 template <size_t Count>
 lc_status send_event(const char *event, const event_field (&fields)[Count]) {
-    const cancel_off_guard uncancelled;
     const mutex_guard guard(&qv_alm_session_mutex);
     if (!qv_alm_mgmt_session)
         return LC_NULL;

@@ -1,24 +1,31 @@
-// The engine's one global record, its start and stop, and the timer thread.
+// Start and stop of the engine, and the timer thread.
 //
-// Threads. "WCCP_TIMER" sleeps a second and runs a tick; it is not created in bridge mode. One "WCCP_RX_..."
-// for each interface that ever had an address (wccp_network.cpp) waits for a datagram without any lock and
-// processes it under the engine lock. Both are ended by cancellation only: in a sleep, in a wait, or right
-// after they got the engine lock (wccp_utils.cpp). Whatever they hold there is in guards, so that no lock is
-// lost with them.
+// This file defines wccp_g, the global record. wccp_init_mgr and wccp_exit_mgr are called by the main thread
+// without the engine lock.
 //
-// Bridge mode. Stopping the groups and cancelling the threads is one step under the engine lock. The lock is
-// released before the threads are joined, because any of them may be waiting for it; a thread that gets the
-// lock then finds itself cancelled. Nothing here starts the threads again.
+// Threads. "WCCP_TIMER" runs one tick a second; it is not created in bridge mode. Each interface that has had
+// an address has a receive thread "WCCP_RX_<name>" (wccp_network.cpp), which waits for a datagram without a
+// lock and processes it with the engine lock held.
 //
-// Exit. The groups go first, each with its shutdown message, then the threads. Notifications and datagrams
-// that arrive during the exit are ignored: nobody creates a thread after all of them have been ended, and
-// between the two steps there is no group that a datagram could belong to, and the mailbox has been reset.
+// Cancellation is the only way in which these threads end. It is requested either with the engine lock held
+// (bridge mode) or after the last group has been deleted (exit). A cancelled thread is therefore in its sleep
+// or its poll, or waits for the engine lock, which acts on the request before any work begins (struct
+// wccp_engine_lock). A thread is never cancelled in the middle of a tick, while it processes a packet of a
+// group, or while it waits for tunneld: code that runs with the engine lock held need not expect it.
 //
-// The platform's notifier thread lives until the process is gone. What its callbacks can reach, wccp_g above
-// all, is plain memory without a destructor.
+// Bridge mode. The groups are stopped and the threads cancelled in one hold of the engine lock. It is
+// released before the threads are joined, because any of them may be waiting for it. Nothing starts them
+// again.
 //
-// wccp_g.track_primary stays 0: nothing of this appliance ties the groups to the primary interface, which is
-// a table entry like the others.
+// Exit. The groups are deleted first, each with its shutdown message, then the threads end. Notifications and
+// datagrams that arrive meanwhile are ignored: nothing may create a thread after all of them have been
+// joined.
+//
+// The platform's notifier thread runs until the process is gone. Everything that its callbacks can reach,
+// wccp_g above all, therefore has no destructor.
+//
+// wccp_g.track_primary is always 0: groups do not depend on the primary interface, which is an ordinary entry
+// of the interface table.
 
 #include "engine/wccp_mgr.h"
 
@@ -41,7 +48,7 @@
 #include "platform/qvcommon.h"
 #include "runtime/logging.h"
 
-// All zero, which is also the state of an unlocked mutex.
+// Usable before wccp_init_mgr: all zero is also an unlocked mutex.
 constinit wccp_global wccp_g = {};
 static_assert(std::is_trivially_destructible_v<wccp_global>);
 
@@ -62,7 +69,7 @@ int start_timer_thread() {
 
 int wccp_init_mgr() {
     QV_LOG(LC_LOG_INFO, "WCCP: Initialize WCCP manager");
-    new (&wccp_g) wccp_global{};
+    new (&wccp_g) wccp_global{}; // it has atomics, so it cannot be assigned or zeroed by memset
     pthread_mutex_init(&wccp_g.lock, nullptr);
     wccp_g.mcast_ttl = DEFAULT_MCAST_TTL;
 
@@ -122,7 +129,7 @@ void wccp_tick() {
     if (wccpd_shutdown_in_progress() == 1)
         return;
     const wccp_engine_lock lock;
-    if (wccpd_shutdown_in_progress() == 1) // begun while this thread waited
+    if (wccpd_shutdown_in_progress() == 1) // the exit began while this thread waited for the lock
         return;
     wccp_g.seconds++;
     wccp_report_suppressed_complaints();

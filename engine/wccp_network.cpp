@@ -209,7 +209,6 @@ int wccp_init_network_by_interface(wccp_interface *interface) {
 bool wccp_retry_network(wccp_interface *interface) {
     if (interface->network_flaws == 0 || is_zero(interface->ipa))
         return false;
-    const cancel_off_guard whole; // the timer thread may be cancelled, and a descriptor would be lost
     if (interface->network_flaws & WCCP_FLAW_SOCKETS) {
         wccp_init_network_by_interface(interface);
     } else { // sockets that work stay open

@@ -203,16 +203,6 @@ wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 
 
 namespace {
 
-// A router that has left the list, to the end of the scope.
-struct departing_router {
-    ~departing_router() {
-        group->sending_router_count--;
-        wccp_free(router);
-    }
-    wccp_service_group *group;
-    wccp_sending_router *router;
-};
-
 void drop_view_references(wccp_service_group *group, wccp_sending_router *router) {
     for (uint32_t i = 0; i < router->view_router_count; i++)
         wccp_remove_router_from_view_list(group, router->view_routers[i].ipa);
@@ -224,13 +214,9 @@ void drop_view_references(wccp_service_group *group, wccp_sending_router *router
 
 void remove_silent_router(wccp_service_group *group, wccp_sending_router *router) {
     list_unlink(router);
-    const departing_router departing = {group, router};
-    {
-        const cancel_off_guard whole; // a line of the log must not part the record from its view entries
-        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removing router (router id: %s) due to inactivity.", group->id,
-               addr_text(router->router_id).s);
-        drop_view_references(group, router);
-    }
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removing router (router id: %s) due to inactivity.", group->id,
+           addr_text(router->router_id).s);
+    drop_view_references(group, router);
     if (router->flags & WCCP_RTR_HAS_TUNNEL)
         wccp_del_tunnel(group->id, group->appliance_ipa, router->router_id, 0);
     if (group->sending_router_count == 1) {
@@ -248,6 +234,8 @@ void remove_silent_router(wccp_service_group *group, wccp_sending_router *router
     }
     group->change_number++;
     group->state_flags |= WCCP_DESG_ELECT_PENDING;
+    group->sending_router_count--;
+    wccp_free(router);
 }
 
 } // namespace

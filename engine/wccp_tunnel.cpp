@@ -8,11 +8,6 @@
 // The tunnel mutex covers the list and the bitmap. It is taken after the engine lock and before the mailbox's
 // own. An add releases it while it waits for tunneld; a delete and a restore hold it through the wait. Two
 // adds for one new key are kept apart by the engine lock, which every caller of wccp_add_tunnel holds.
-//
-// A caller can be cancelled in each of these waits. An add that is cancelled gives back its id and frees its
-// record; a delete still takes its record out of the table, as after a delete that failed; and the mutex is
-// released. From the moment a new record is in the table until wccp_add_tunnel has returned there is no
-// cancellation: a caller that notes its reference at once never loses one.
 
 #include "engine/wccp_tunnel.h"
 
@@ -132,7 +127,6 @@ int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
                       addr_text(local).s, addr_text(remote).s);
         return 1;
     }
-    const cancel_off_guard whole;
     tunnel.pointer->tunnel_id = id.id;
     tunnel.pointer->local_ipa = local;
     tunnel.pointer->remote_ipa = remote;

@@ -167,36 +167,20 @@ void write_command(wccp_tunnel_mailbox *mailbox, uint16_t code, const mailbox_in
     wccp_wake_tunneld();
 }
 
-// A command that is being waited for. However the wait ends, an add without an answer is withdrawn; the other
-// commands stay pending.
-struct pending_command {
-    ~pending_command() { is_answered_at_last(); }
-    bool is_answered() const { return mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE; }
-    bool is_answered_at_last() const {
-        return code == MAILBOX_ADD_TUNNEL ? !wccp_withdraw_command(mailbox) : is_answered();
-    }
-    wccp_tunnel_mailbox *mailbox;
-    uint16_t code;
-};
-
 enum class wait_end { ANSWERED, TIMED_OUT, ABANDONED };
 
 wait_end wait_for_answer(wccp_tunnel_mailbox *mailbox, uint16_t code) {
-    const pending_command pending = {mailbox, code};
     wait_end end = wait_end::TIMED_OUT;
     for (int i = 0; i < ANSWER_POLLS && end == wait_end::TIMED_OUT; i++) {
-        {
-            const cancel_off_guard whole;
-            poll(nullptr, 0, 1);
-        }
-        if (pending.is_answered())
+        poll(nullptr, 0, 1);
+        if (mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE)
             return wait_end::ANSWERED;
         if (abandon.load(std::memory_order_acquire))
             end = wait_end::ABANDONED;
-        else
-            pthread_testcancel();
     }
-    return pending.is_answered_at_last() ? wait_end::ANSWERED : end;
+    if (code == MAILBOX_ADD_TUNNEL && !wccp_withdraw_command(mailbox))
+        return wait_end::ANSWERED; // at the last moment: the tunnel exists
+    return end;
 }
 
 // Gives the command and waits, unless it is refused. True when tunneld has answered; its answer is then in

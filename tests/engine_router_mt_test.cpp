@@ -1,7 +1,4 @@
-// Sending routers with GRE tunnels, with tunneld on the other side of the mailbox: one tunnel for each
-// router, and nothing lost when the thread that waits for tunneld is cancelled.
-#include <pthread.h>
-
+// Sending routers with GRE tunnels, with tunneld on the other side of the mailbox.
 #include <memory>
 #include <vector>
 
@@ -27,16 +24,6 @@ struct TunnelledRouters : testing::Test {
         wccp_del_all_tunnels();
         shared.reset();
         EXPECT_EQ(wccp_g.stat_allocs.load(), wccp_g.stat_frees.load());
-    }
-    // Runs `work` under the engine lock on a thread that is cancelled as soon as it waits for tunneld.
-    void cancel_in_the_wait(void (*work)(wccp_service_group *group)) {
-        cancel_while_it_waits(&tunneld, [this, work] {
-            const wccp_engine_lock lock;
-            work(group);
-        });
-        ASSERT_EQ(pthread_mutex_trylock(&wccp_g.lock), 0) << "a lock that nobody holds any more";
-        pthread_mutex_unlock(&wccp_g.lock);
-        tunneld.answer_with(tunneld_does);
     }
     std::vector<uint16_t> codes() {
         std::vector<uint16_t> found;
@@ -65,30 +52,6 @@ TEST_F(TunnelledRouters, GetATunnelEachAndGiveItBack) {
     wccp_monitor_sending_routers(group);
     EXPECT_EQ(group->sending_router_count, 0u);
     EXPECT_EQ(codes(), (std::vector<uint16_t>{MAILBOX_DELETE_TUNNEL, MAILBOX_DELETE_TUNNEL}));
-}
-
-TEST_F(TunnelledRouters, ARouterInTheMakingGoesWithItsThread) {
-    tunneld.answer_with(tunneld_is_silent);
-    cancel_in_the_wait(
-        [](wccp_service_group *waiting) { wccp_create_sending_router(waiting, ROUTER_A, &GRE, &GRE); });
-    EXPECT_EQ(group->sending_router_count, 0u);
-    EXPECT_EQ(group->sending_routers, nullptr);
-    EXPECT_FALSE(group->state_flags & WCCP_CAPABILITIES_SET);
-    ASSERT_NE(wccp_create_sending_router(group, ROUTER_A, &GRE, &GRE), nullptr);
-    wccp_g.seconds += 40;
-    wccp_monitor_sending_routers(group);
-}
-
-TEST_F(TunnelledRouters, ARouterOnItsWayOutGoesWithItsThread) {
-    ASSERT_NE(wccp_create_sending_router(group, ROUTER_A, &GRE, &GRE), nullptr);
-    shared->see(ROUTER_A, {ROUTER_A}, {{US, 100}});
-    wccp_g.seconds += 40;
-    tunneld.answer_with(tunneld_is_silent);
-    cancel_in_the_wait([](wccp_service_group *waiting) { wccp_monitor_sending_routers(waiting); });
-    EXPECT_EQ(group->sending_router_count, 0u);
-    EXPECT_EQ(group->sending_routers, nullptr);
-    EXPECT_EQ(group->appliance_view, nullptr);
-    EXPECT_EQ(group->router_view, nullptr);
 }
 
 } // namespace

@@ -154,35 +154,6 @@ TEST_F(Tunnels, RestoreGivesEveryTunnelAgainAndKeepsThemAll) {
     EXPECT_EQ(given[2].index, 70u + g_qv_encap_wccp_first) << "the new index";
 }
 
-// A thread that is cancelled while it waits for tunneld.
-TEST_F(Tunnels, ACancelledAddGivesIdAndRecordBack) {
-    tunneld.answer_with(tunneld_is_silent);
-    for (int i = 0; i < 3; i++) {
-        cancel_while_it_waits(&tunneld, [] { wccp_add_tunnel(51, self, router(1)); });
-        EXPECT_EQ(wccp_g.stat_allocs - wccp_g.stat_frees, allocated);
-        EXPECT_EQ(wccp_get_tunnel_command(), 0) << "nobody knows the tunnel that would come of it";
-    }
-    tunneld.answer_with(tunneld_does);
-    commands();
-    EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
-    EXPECT_EQ(commands()[0].tunnel_id, g_qv_encap_wccp_first);
-}
-
-TEST_F(Tunnels, ACancelledDeleteStillTakesTheTunnelOut) {
-    EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
-    EXPECT_EQ(wccp_add_tunnel(51, self, router(2)), 0);
-    tunneld.answer_with(tunneld_is_silent);
-    cancel_while_it_waits(&tunneld, [] { wccp_del_tunnel(51, self, router(1), 0); });
-    tunneld.answer_with(tunneld_does);
-    while (wccp_get_tunnel_command() != MAILBOX_IDLE) // the delete is carried out late
-        std::this_thread::yield();
-    commands();
-    EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0) << "and the mutex is free";
-    EXPECT_EQ(commands().size(), 0u) << "it is out of the table";
-    EXPECT_EQ(wccp_add_tunnel(51, self, router(3)), 0);
-    EXPECT_EQ(commands()[0].tunnel_id, g_qv_encap_wccp_first) << "its id is free";
-}
-
 // Tunnels come and go on several threads while all are deleted, as at exit: commands don't overlap, and each
 // gets the answer to its own.
 TEST_F(Tunnels, DeletingAllWhileOthersAddAndDelete) {

@@ -1,7 +1,6 @@
 #include "tests/support/fake_tunneld.h"
 
 #include <gtest/gtest.h>
-#include <pthread.h>
 #include <sys/shm.h>
 
 #include <chrono>
@@ -70,22 +69,6 @@ std::optional<tunneld_answer> tunneld_does(const seen_command &command) {
 }
 std::optional<tunneld_answer> tunneld_is_silent(const seen_command &) {
     return std::nullopt;
-}
-
-void cancel_while_it_waits(fake_tunneld *tunneld, const std::function<void()> &work) {
-    pthread_t waiter;
-    const auto body = [](void *argument) -> void * {
-        (*static_cast<const std::function<void()> *>(argument))();
-        return nullptr;
-    };
-    ASSERT_EQ(pthread_create(&waiter, nullptr, body, const_cast<std::function<void()> *>(&work)), 0);
-    tunneld->wait_for_command();
-    const auto begin = std::chrono::steady_clock::now();
-    pthread_cancel(waiter);
-    void *result = nullptr;
-    pthread_join(waiter, &result);
-    EXPECT_EQ(result, PTHREAD_CANCELED);
-    EXPECT_LT(std::chrono::steady_clock::now() - begin, 1s);
 }
 
 // A process makes its block once. A test that starts the engine again plays a new process: the records of the

@@ -52,9 +52,6 @@ std::optional<tunneld_answer> tunneld_does(const seen_command &command);
 // No command answered.
 std::optional<tunneld_answer> tunneld_is_silent(const seen_command &command);
 
-// Runs `work` on a thread, and cancels it once `tunneld` has seen its command and left it unanswered.
-void cancel_while_it_waits(fake_tunneld *tunneld, const std::function<void()> &work);
-
 // Writes the configuration file with the mailbox's line, and lets the process create its block once more.
 // Call it before wccp_init_shmem.
 void write_mem_conf();
