@@ -9,11 +9,12 @@ namespace {
 
 const char HELP[] =
     "Usage: wccpd\n"
-    "Makes this appliance a member of WCCP version 2 service groups. wccpd has no options of its own and no\n"
-    "configuration file: it asks mgmtd, which has to run, and logs to syslog.\n"
-    "  --help      this text\n"
-    "  --version   the version\n"
-    "SIGTERM, SIGINT and SIGHUP end it in order. See wccpd(8), mgmtctl(1) and mgmtd.conf(5).\n";
+    "Makes this appliance a member of WCCP version 2 service groups. wccpd has no options and no "
+    "configuration\n"
+    "file: it gets its configuration from mgmtd, which must be running, and logs to syslog.\n"
+    "  --help      print this text\n"
+    "  --version   print the version\n"
+    "SIGTERM, SIGINT and SIGHUP make it exit cleanly. See wccpd(8), mgmtctl(1) and mgmtd.conf(5).\n";
 
 } // namespace
 

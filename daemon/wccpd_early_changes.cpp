@@ -73,7 +73,8 @@ lc_status keep_early_change(bn_binding_array **inout_new_values) {
     CHECK_CONDITION(early_changes_are_kept());
     const size_t bytes = estimate_bytes(*inout_new_values);
     if (bytes > EARLY_CHANGES_MAX_BYTES - kept_changes.bytes) {
-        LC_LOG(LC_LOG_ERR, "Configuration change lost: too much has been changed during the start");
+        LC_LOG(LC_LOG_ERR,
+               "Configuration change lost: too many changes arrived during the start; restart wccpd");
         return LC_NO_SPACE;
     }
     early_change *change = static_cast<early_change *>(calloc(1, sizeof *change));

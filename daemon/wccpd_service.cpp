@@ -55,7 +55,7 @@ bool may_reach_mgmtd(char *out_missing) {
         return errno != EACCES;
     if (faccessat(AT_FDCWD, path, W_OK, AT_EACCESS) == 0)
         return true;
-    snprintf(out_missing, TEXT_BYTES, "to be root or user %u, to whom mgmtd belongs: %s: %s",
+    snprintf(out_missing, TEXT_BYTES, "running as root or as user %u, like mgmtd: %s: %s",
              static_cast<unsigned>(about.st_uid), path, strerror(errno));
     return false;
 }
@@ -75,7 +75,7 @@ void report_alive(int, short, void *) {
 int wccpd_report_missing_privileges() {
     int missing = 0;
     for (const auto has : privileges) {
-        char text[TEXT_BYTES] = "the directory of mgmtd's socket cannot be searched";
+        char text[TEXT_BYTES] = "permission to search the directory of mgmtd's socket";
         if (has(text))
             continue;
         missing++;

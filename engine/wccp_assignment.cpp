@@ -73,9 +73,10 @@ void wccp_designated_appliance_assignment_add(wccp_service_group *group,
         return;
     }
     if (group->dsg_appliance_count >= WCCP_MAX_APPLIANCES && !drop_smallest_down_entry(group)) {
-        QV_LOG(LC_LOG_WARNING,
-               "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) is one too many.",
-               group->id, addr_text(appliance->ipa).s, appliance->weight);
+        QV_LOG(
+            LC_LOG_WARNING,
+            "WCCP GRP %d: DSG event: NO redirect. appliance (ipa  %s weight %d) exceeds the maximum of 32.",
+            group->id, addr_text(appliance->ipa).s, appliance->weight);
         return;
     }
     group->dsg_appliances[group->dsg_appliance_count++] = {

@@ -223,7 +223,7 @@ int wccp_add_group(const wccp_grp_config *config) {
     wccp_if_add_group(group, interface);
     if (group->mcast_configured && wccp_join_mc_grp(interface, group->mcast_ipa)) {
         wccp_note_network(group);
-        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: cannot join %s on interface %s now", group->id,
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: cannot join %s on interface %s yet", group->id,
                addr_text(group->mcast_ipa).s, interface->name);
         return 1;
     }

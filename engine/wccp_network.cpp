@@ -244,7 +244,8 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
     if (setsockopt(interface->mcast_fd, IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof membership) == 0) {
         if (address != interface->mcast_bound_ipa)
             QV_LOG(LC_LOG_NOTICE,
-                   "WCCP: Interface %s: the multicast socket is bound to %s: what is sent to %s is not heard",
+                   "WCCP: Interface %s: the multicast socket is bound to %s, so datagrams sent to %s are not "
+                   "received",
                    interface->name, addr_text(interface->mcast_bound_ipa).s, addr_text(address).s);
         return 0;
     }

@@ -368,14 +368,14 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
         log_failed_step("unloading msg header", 1);
         return refuse_packet(pkt);
     }
-    const uint32_t told = to_host(header->length) + static_cast<uint32_t>(sizeof *header);
-    if (told != pkt->length) {
+    const uint32_t claimed = to_host(header->length) + static_cast<uint32_t>(sizeof *header);
+    if (claimed != pkt->length) {
         WCCP_COMPLAIN(
             LC_LOG_ERR,
             "WCCP: message header length (%d) and actual packet length (%d) do not match. sender ip: %s",
             to_host(header->length), static_cast<int>(pkt->length), addr_text(pkt->ipa).s);
         wccp_note_reason(nullptr, WCCP_REASON_MESSAGE_LENGTH, pkt->ipa,
-                         wccp_reason_value("%u bytes in its header", told),
+                         wccp_reason_value("%u bytes in its header", claimed),
                          wccp_reason_value("%u bytes received", pkt->length));
         return 0;
     }

@@ -298,10 +298,10 @@ uint16_t decode_bucket_bits(const wccp_wire_view_element_hash *element, wccp_rtr
 int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, uint32_t count,
                                                    wccp_view_elements elements,
                                                    wccp_rtr_view_appliance *decoded,
-                                                   wccp_assign_summary *out_hash) {
-    if (!group || !decoded || !out_hash || count > WCCP_MAX_APPLIANCES)
+                                                   wccp_assign_summary *hash_summary) {
+    if (!group || !decoded || !hash_summary || count > WCCP_MAX_APPLIANCES)
         return 1;
-    *out_hash = {.valid = 1, .self_count = 0, .total_count = 0};
+    *hash_summary = {.valid = 1, .self_count = 0, .total_count = 0};
     const received_bytes bytes = {elements.first, elements.size};
     uint64_t distance = 0;
     uint32_t total = 0;
@@ -322,21 +322,21 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
             return 1;
         }
         decoded->weight = to_host(*weight);
-        out_hash->mask_forms |= by_hash ? 0 : 1u << i;
+        hash_summary->mask_forms |= by_hash ? 0 : 1u << i;
         if (shape.form == WCCP_ELEMENT_REDIRECT) {
-            out_hash->valid = 0; // the assignment comes as a map
+            hash_summary->valid = 0; // the assignment comes as a map
         } else if (by_hash && flags & WCCP_IDENTITY_HISTORICAL) {
             QV_LOG(LC_LOG_INFO, "WCCP GRP %d: app id. %s assignment is historical, ignored", group->id,
                    addr_text(decoded->ipa).s);
         } else if (by_hash) {
             const uint16_t assigned = decode_bucket_bits(hash, decoded);
             if (decoded->ipa == group->appliance_ipa)
-                out_hash->self_count = assigned;
+                hash_summary->self_count = assigned;
             total += assigned;
         }
         distance += shape.size;
     }
-    out_hash->total_count = static_cast<uint16_t>(total < WCCP_MAX_BUCKETS ? total : WCCP_MAX_BUCKETS);
+    hash_summary->total_count = static_cast<uint16_t>(total < WCCP_MAX_BUCKETS ? total : WCCP_MAX_BUCKETS);
     return 0;
 }
 
@@ -415,7 +415,7 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
                               wccp_reason_value("a multiple of %u", element_size));
     }
     if (length >= (std::size(known) + 1) * element_size)
-        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: more capabilities than are known. length %d", group->id,
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: more capabilities than the known ones. length %d", group->id,
                clamp_to_int(length));
     const auto *element = peek_layout<wccp_wire_capability_element>(pkt, sizeof *head, length / element_size);
     if (!element)

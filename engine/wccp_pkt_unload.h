@@ -73,8 +73,8 @@ int wccp_pkt_unload_router_query_component(wccp_service_group *group, wccp_pkt *
 uint16_t wccp_pkt_next_component_type(const wccp_pkt *pkt);
 int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt);
 // Decodes `count` elements, in their order, and sums up what the hash forms assign. `decoded` has room for
-// WCCP_MAX_APPLIANCES entries and is zeroed. Also 1 for a null group, `decoded` or `out_hash`.
+// WCCP_MAX_APPLIANCES entries and is zeroed. Also 1 for a null group, `decoded` or `hash_summary`.
 int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, uint32_t count,
                                                    wccp_view_elements elements,
                                                    wccp_rtr_view_appliance *decoded,
-                                                   wccp_assign_summary *out_hash);
+                                                   wccp_assign_summary *hash_summary);

@@ -73,26 +73,25 @@ bool wccp_group_is_running(const wccp_service_group *group) {
 
 namespace {
 
-void *counted_calloc(const char *function, uint32_t count, uint32_t size) {
+void *counted_calloc(const char *failure, uint32_t count, uint32_t size) {
     void *memory = calloc(count, size);
     if (memory) {
         wccp_g.stat_allocs.fetch_add(1, std::memory_order_relaxed);
         return memory;
     }
     wccp_g.stat_alloc_fails.fetch_add(1, std::memory_order_relaxed);
-    QV_LOG(LC_LOG_ERR, "WCCP %s: memory allocation failed. size: %d bytes", function,
-           static_cast<int>(count * size));
+    QV_LOG(LC_LOG_ERR, failure, static_cast<int>(count * size));
     return nullptr;
 }
 
 } // namespace
 
 void *wccp_calloc(uint32_t count, uint32_t size) {
-    return counted_calloc("wccp_calloc", count, size);
+    return counted_calloc("WCCP wccp_calloc: memory allocation failed. size: %d bytes", count, size);
 }
 
 void *wccp_malloc(uint32_t size) {
-    return counted_calloc("wccp_malloc", 1, size);
+    return counted_calloc("WCCP wccp_malloc: memory allocation failed. size: %d bytes", 1, size);
 }
 
 void wccp_free(void *memory) {

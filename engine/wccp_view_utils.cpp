@@ -106,11 +106,11 @@ int wccp_remove_appliance_from_view_list(wccp_service_group *group, be32 address
 
 namespace {
 
-void note_view_change(wccp_service_group *group, const wccp_sending_router *router, const char *what) {
+void note_view_change(wccp_service_group *group, const wccp_sending_router *router, const char *line) {
     group->change_number++;
     group->state_flags |= WCCP_DESG_ELECT_PENDING;
-    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: %s view has changed. sending router %s local change number %d",
-           group->id, what, addr_text(router->router_id).s, static_cast<int>(group->change_number));
+    QV_LOG(LC_LOG_INFO, line, group->id, addr_text(router->router_id).s,
+           static_cast<int>(group->change_number));
 }
 
 // The reports.
@@ -230,7 +230,8 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
         if (taken >> i & 1)
             router->view_routers[router->view_router_count++].ipa = addresses[i];
     if (changed)
-        note_view_change(group, router, "router");
+        note_view_change(group, router,
+                         "WCCP GRP %d: router view has changed. sending router %s local change number %d");
     return status;
 }
 
@@ -384,7 +385,8 @@ int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *r
         status = apply_appliance_report(group, router, count, decoded, &taken, &changed);
     store_appliance_report(router, count, decoded, taken);
     if (changed)
-        note_view_change(group, router, "appliance");
+        note_view_change(group, router,
+                         "WCCP GRP %d: appliance view has changed. sending router %s local change number %d");
     return status;
 }
 

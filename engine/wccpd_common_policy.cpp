@@ -97,10 +97,12 @@ uint32_t derive_policy_role(const policy_grp_set *set) {
 }
 
 void update_policy_role(uint16_t policy) {
-    static const char *const names[] = {"ACTIVE", "BACKUP", "UNKNOWN"};
+    static const char *const lines[] = {"WCCP: Update policy group %d role to ACTIVE",
+                                        "WCCP: Update policy group %d role to BACKUP",
+                                        "WCCP: Update policy group %d role to UNKNOWN"};
     const uint32_t role = derive_policy_role(find_member_set(policy));
     if (wccp_publish_policy_role(policy, role))
-        QV_LOG(LC_LOG_DEBUG, "WCCP: Update policy group %d role to %s", policy, names[role]);
+        QV_LOG(LC_LOG_DEBUG, lines[role], policy);
 }
 
 } // namespace

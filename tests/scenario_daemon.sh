@@ -51,7 +51,7 @@ expect_lacking() { # PROGRAM EXPRESSION COMMAND... : COMMAND runs the program
     [ $? = 1 ] && grep -Eq "^$1: .*$2" <<<"$output" || fail "$1 without privileges: $output"
 }
 expect_lacking wccpd 'missing privilege: CAP_IPC_LOCK, .* \(now 64 KiB\)' prlimit --memlock=65536 setpriv --bounding-set -all --inh-caps -all
-expect_lacking wccpd 'missing privilege: to be root or user 0' setpriv --reuid 65534 --clear-groups --ambient-caps +ipc_lock --inh-caps +ipc_lock
+expect_lacking wccpd 'missing privilege: running as root or as user 0' setpriv --reuid 65534 --clear-groups --ambient-caps +ipc_lock --inh-caps +ipc_lock
 expect_lacking tunneld 'missing privileges: CAP_NET_ADMIN, CAP_NET_RAW' \
     unshare --mount sh -c 'mount -t tmpfs tmpfs /run && exec "$@"' - setpriv --bounding-set -all --inh-caps -all
 for program in wccpd tunneld mgmtd mgmtctl; do
