@@ -1,34 +1,33 @@
-// One loop over libevent, with what the daemon relies on beyond it.
+// An event loop over libevent, with the guarantees that the daemon needs beyond it.
 //
-// Nesting. libevent refuses to be run from a callback of its own. So here it only finds out what is ready or
-// due: its callbacks put the event on a list and do nothing else. When event_base_loop has returned, the
-// found events go to the end of one queue, and loop_run calls them from there. A callback may call loop_run
-// again: the inner rounds find more, and run the same queue, the outer round's leftovers first. An event that
-// is removed or freed leaves the queue as well, so nothing runs that an earlier callback has taken away, at
-// whatever depth. Nothing of an event is touched once its function has been called. What waits in the queue
-// makes the next look at the descriptors one without waiting.
+// Nesting. libevent refuses to run from inside one of its own callbacks. Here its callbacks therefore only
+// put the event on a ready list. When event_base_loop has returned, ready events move to the end of a queue,
+// and loop_run calls their functions from there. Such a function may call loop_run again: the inner rounds
+// collect further events and continue with the same queue, what is left of the outer round first. An event
+// that is removed or freed also leaves the queue, so a function is never called for an event that an earlier
+// function has removed. An event is not accessed after its function has been called, which may have freed it.
+// While the queue is not empty, the next round polls the descriptors without waiting.
 //
-// Threads. libevent is only ever called by the thread that owns the loop. Another thread that wants a change
-// posts it: the post lies in a list under a mutex that is never held while anything else is taken, and the
-// owner carries it out before it runs its next callback. The poster waits for nothing, so it may hold any
-// lock. A poster that finds the list empty wakes the owner through the self-pipe. Work that was posted counts
-// as something that ran, so that a wait for one round sees what it changed.
+// Threads. Only the owner thread calls libevent. Another thread that needs a change posts it to a list, whose
+// mutex is never held while another lock is taken; the owner carries it out before its next callback. Posting
+// does not wait, so the poster may hold any lock. If the list was empty, the poster wakes the owner through
+// the self-pipe. Posted work counts as something that ran, so that a wait for one round sees what it changed.
 //
-// The lock is recursive and held during all callbacks; the wait releases it whole, however deep, and takes it
-// again to the same depth. A nested wait so takes it while it holds the locks of its session. That is sound
-// only because no other thread asks for anything while it holds this lock: signal registrations and the
-// escape are all that others do with it. It is a mutex with a condition and not an lc_lock, since it has to
-// be let go of whole.
+// Lock. The loop's lock is recursive and held during all callbacks. The wait releases it completely, whatever
+// its depth, and takes it again to the same depth. A nested wait thus takes it while it holds the locks of
+// its session, against the usual order. This cannot deadlock, because other threads hold this lock only to
+// register a signal or to escape, and take no other lock meanwhile. It is a mutex with a condition, since a
+// recursive mutex cannot be released completely.
 //
-// Signals are blocked in the owner's thread but for the wait. The handler writes a message of 128 bytes to
-// the self-pipe; the owner reads it and puts the signal's events on the queue. Each signal belongs to one
-// context. A signal whose last registration goes gets its earlier disposition back but stays blocked in this
+// Signals are blocked in the owner's thread except during the wait. The handler writes a message of 128 bytes
+// to the self-pipe; the owner reads it and queues the events of that signal. Each signal belongs to one loop.
+// When its last event is removed, the earlier disposition is restored, but the signal stays blocked in this
 // thread, so that a second SIGTERM does not kill the process in the middle of its orderly exit.
 //
-// The escape flag is never cleared. Each round looks at it first, and again after each callback.
+// Escape. The flag is never cleared. It is tested before each round and before each callback.
 //
-// poll is the mechanism, not epoll: a descriptor that was closed under its event then shows as readable and
-// writable, instead of vanishing silently.
+// The loop uses poll, not epoll: when a descriptor is closed while its event is active, poll reports it as
+// ready, whereas epoll drops it silently.
 #include "daemon/libevent_loop.h"
 
 #include <algorithm>
@@ -70,11 +69,11 @@ struct loop_event {
     void *data;
     event base_event;
     event_kind kind;
-    bool inserted;
-    int number; // descriptor or signal
-    short ready_flags;
+    bool inserted;     // active, and counted in the context
+    int number;        // descriptor or signal, -1 for a timer
+    short ready_flags; // 0: not on the ready list
     loop_event *next_ready;
-    short queued_flags;
+    short queued_flags; // 0: not in the queue
     loop_event *next_queued, *previous_queued;
     loop_event *next_signal;
 };
@@ -82,7 +81,7 @@ struct loop_event {
 namespace {
 
 struct loop_lock {
-    pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
+    pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER; // guards holder and count
     pthread_cond_t freed = PTHREAD_COND_INITIALIZER;
     pthread_t holder{};
     uint32_t count = 0;
@@ -96,9 +95,9 @@ struct loop_context {
     loop_lock lock;
     std::atomic<int32_t> escape;
     int pipe_read, pipe_write;
-    event *pipe_event, *limit_event;
+    event *pipe_event, *limit_event; // limit_event bounds a wait without timers
     bool pipe_readable;
-    uint32_t inserted, descriptors, timers;
+    uint32_t inserted, descriptors, timers; // numbers of active events
     loop_event *ready_first, *ready_last;
     loop_event *queue_first, *queue_last;
     loop_event *signals;
@@ -107,14 +106,14 @@ struct loop_context {
     loop_post *posts_first, *posts_last;
 };
 
-// ---- The lock
+// --- The lock
 
 namespace {
 
 void take_loop_lock(loop_lock *lock, uint32_t count) {
     const mutex_guard guard(&lock->mutex);
     const pthread_t self = pthread_self();
-    while (lock->count && !pthread_equal(lock->holder, self))
+    while (lock->count && !pthread_equal(lock->holder, self)) // the holder itself never waits
         pthread_cond_wait(&lock->freed, &lock->mutex);
     lock->holder = self;
     lock->count += count;
@@ -139,7 +138,7 @@ int loop_is_own_thread(const loop_context *context) {
     return pthread_equal(context->owner, pthread_self());
 }
 
-// ---- The queue
+// --- The queue
 
 namespace {
 
@@ -167,7 +166,7 @@ short unqueue_event(loop_event *event) {
     return flags;
 }
 
-// What libevent calls: inside the wait, without the lock, on the owner's thread.
+// Called by libevent during the wait, on the owner's thread and without the lock.
 void handle_ready_event(evutil_socket_t, short flags, void *data) {
     loop_event *event = static_cast<loop_event *>(data);
     loop_context *context = event->context;
@@ -194,7 +193,7 @@ void queue_ready_events(loop_context *context) {
     context->ready_last = nullptr;
 }
 
-// ---- Events
+// --- Events
 
 void count_event(loop_event *event, bool in) {
     loop_context *context = event->context;
@@ -243,7 +242,7 @@ lc_status loop_event_set_fd(loop_event *event, int fd, short flags) {
     if (event_assign(&event->base_event, event->context->base, fd, static_cast<short>(flags | EV_PERSIST),
                      handle_ready_event, event) != 0)
         FAIL_WITH(LC_GENERIC);
-    if (!flags) { // registered, and waits for nothing
+    if (!flags) { // it counts as registered, but waits for nothing
         count_event(event, true);
         return LC_OK;
     }
@@ -263,12 +262,13 @@ lc_status loop_event_set_timer(loop_event *event, int64_t delay_ms) {
     timeval delay;
     delay.tv_sec = delay_ms / 1000;
     delay.tv_usec = delay_ms % 1000 * 1000;
+    // No expiry time exceeds 31 bits in seconds.
     delay.tv_sec = std::min(delay.tv_sec, TIME_MAX_SECONDS - lt_monotonic_ms() / 1000 - 1);
     CHECK_STATUS(insert_event(event, &delay));
     return LC_OK;
 }
 
-// ---- Signals
+// --- Signals
 
 std::atomic<loop_context *> le_signal_contexts[LEW_SIGNAL_MAX + 1];
 namespace {
@@ -282,7 +282,8 @@ void write_signal_message(int number, siginfo_t *, void *) {
     if (context) {
         char message[MESSAGE_BYTES] = {};
         memcpy(message, &number, sizeof number);
-        // A full pipe loses the message; the handler runs in the wait only, which empties the pipe each time.
+        // A full pipe would lose the message, but the owner empties it after each wait, and the handler runs
+        // only during a wait.
         (void)!write(context->pipe_write, message, sizeof message);
     }
     errno = saved;
@@ -305,7 +306,7 @@ lc_status take_signal(loop_context *context, int number) {
     sigset_t set;
     sigemptyset(&set);
     sigaddset(&set, number);
-    pthread_sigmask(SIG_BLOCK, &set, nullptr);
+    pthread_sigmask(SIG_BLOCK, &set, nullptr); // before the handler exists
     le_signal_contexts[number] = context;
     if (sigaction(number, &action, &earlier_actions[number]) != 0) {
         le_signal_contexts[number] = nullptr;
@@ -361,7 +362,7 @@ void remove_signal_event(loop_event *event) {
 
 void loop_event_remove(loop_event *event) {
     const loop_guard guard(event->context);
-    unqueue_event(event);
+    unqueue_event(event); // its function is not called any more
     if (!event->inserted)
         return;
     count_event(event, false);
@@ -382,7 +383,7 @@ void loop_event_free(loop_event **inout) {
 
 namespace {
 
-// Each message of the self-pipe: a signal, or number 0 for a mere wake-up.
+// Reads all messages from the self-pipe: numbers of signals, or 0 for a plain wake-up.
 void read_wake_pipe(loop_context *context) {
     char message[MESSAGE_BYTES];
     while (read(context->pipe_read, message, sizeof message) == static_cast<ssize_t>(sizeof message)) {
@@ -401,14 +402,14 @@ lc_status wake_owner(loop_context *context) {
         written = write(context->pipe_write, message, sizeof message);
     while (written < 0 && errno == EINTR);
     if (written < 0 && errno == EAGAIN)
-        return LC_OK; // a full pipe wakes as well
+        return LC_OK; // a full pipe wakes the owner as well
     CHECK_CONDITION(written == static_cast<ssize_t>(sizeof message));
     return LC_OK;
 }
 
 } // namespace
 
-// ---- Work of other threads
+// --- Work posted by other threads
 
 void loop_post_work(loop_context *context, loop_post *post) {
     const cancel_off_guard cancel_off;
@@ -440,7 +441,7 @@ loop_post *take_first_post(loop_context *context) {
 bool run_posts(loop_context *context) {
     bool ran = false;
     while (loop_post *post = take_first_post(context)) {
-        post->function(post, 1);
+        post->function(post, 1); // without the posts' mutex: it may post again, or free the post
         ran = true;
     }
     return ran;
@@ -477,7 +478,7 @@ void loop_withdraw_posted(loop_context *context, const void *poster) {
     }
 }
 
-// ---- Rounds
+// --- Rounds
 
 namespace {
 
@@ -488,16 +489,17 @@ lc_status wait_for_events(loop_context *context) {
         return LC_GENERIC;
     }
     const timeval limit = {WAIT_MAX_SECONDS, 0};
+    // limit_event ends a wait that no timer would end.
     if (!without_waiting && !context->timers && event_add(context->limit_event, &limit) != 0)
         FAIL_WITH(LC_GENERIC);
     const sigset_t signals = context->owned_signals;
-    const uint32_t held = context->lock.count;
+    const uint32_t held = context->lock.count; // this thread holds the lock, so the count is stable
     give_loop_lock(&context->lock, held);
     pthread_sigmask(SIG_UNBLOCK, &signals, nullptr);
     const int result = event_base_loop(context->base, EVLOOP_ONCE | (without_waiting ? EVLOOP_NONBLOCK : 0));
     pthread_sigmask(SIG_BLOCK, &signals, nullptr);
     take_loop_lock(&context->lock, held);
-    event_del(context->limit_event);
+    event_del(context->limit_event); // harmless if it was not added
     if (context->pipe_readable) {
         context->pipe_readable = false;
         read_wake_pipe(context);
@@ -511,12 +513,12 @@ lc_status wait_for_events(loop_context *context) {
 bool run_queued_events(loop_context *context) {
     bool ran = run_posts(context);
     while (loop_event *event = context->queue_first) {
-        if (context->escape)
+        if (context->escape) // the rest stays queued
             break;
         const short flags = unqueue_event(event);
-        if (event->kind == event_kind::timer)
+        if (event->kind == event_kind::timer) // it runs once
             count_event(event, false);
-        event->function(event->number, flags, event->data); // the event may be gone from here on
+        event->function(event->number, flags, event->data); // may have freed the event
         run_posts(context);
         ran = true;
     }
@@ -536,7 +538,7 @@ lc_status loop_run(loop_context *context, bool once, int *out_no_events, int *ou
         }
         if (once && ran)
             return LC_OK;
-        if (!context->inserted && !context->queue_first) {
+        if (!context->inserted && !context->queue_first) { // waiting could not end
             *out_no_events = 1;
             return LC_OK;
         }
@@ -555,7 +557,7 @@ lc_status loop_escape(loop_context *context) {
     return LC_OK;
 }
 
-// ---- Making and freeing
+// --- Creating and freeing
 
 [[noreturn]] static void exit_with_message(const char *function, const char *what) {
     fprintf(stderr, "%s: %s\n", function, what);

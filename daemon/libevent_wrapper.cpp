@@ -1,10 +1,10 @@
-// `lew`: what the daemon calls. A context holds the loop (libevent_loop.cpp) and the registrations that its
-// callers made, as the sorted array of the addresses of their slots: taking one out frees the event and
-// clears the slot, so a slot reads null again after lew_event_delete or lew_deinit, whoever asked for it.
+// `lew`: the daemon's interface to the event loop. A context owns the loop (libevent_loop.cpp) and the events
+// that its callers have registered. It keeps them as a sorted array of the addresses of the callers' slots;
+// removing an address frees the event and sets the slot to null. A slot must therefore outlive its
+// registration, and it is null after lew_event_delete and lew_deinit.
 //
-// Registrations are made, cancelled and deleted under the loop's lock, by any thread while the loop waits;
-// dispatch is the owner's alone. A registration may be deleted from inside its own callback, as the exit does
-// with all six.
+// Events are registered, cancelled and deleted with the loop's lock held, by any thread while the loop waits.
+// Only the owner dispatches. A callback may delete its own event, as happens to all six signals at exit.
 #include "daemon/libevent_wrapper.h"
 
 #include <cstdlib>
@@ -22,7 +22,7 @@ struct lew_event {
 
 struct lew {
     loop_context *loop;
-    array *slots; // the callers' slots, sorted by address, each once
+    array *slots; // addresses of the callers' slots, sorted, each at most once
 };
 
 namespace {
@@ -83,7 +83,7 @@ lc_status add_slot(lew *context, lew_event **slot) {
 }
 
 void lew_universal_event_handler(int number, short flags, void *data) {
-    const lew_event event = *static_cast<lew_event *>(data); // its callback may delete it
+    const lew_event event = *static_cast<lew_event *>(data); // a copy, because its callback may delete it
     LOG_STATUS(event.callback(number, flags, event.data, event.context));
 }
 
@@ -113,7 +113,7 @@ lc_status lew_event_reg_signal(lew *context, lew_event **slot, int signal_number
     CHECK_CONDITION(signal_number >= 1 && signal_number <= LEW_SIGNAL_MAX);
     const loop_guard guard(context->loop);
     uint32_t place;
-    const bool made = *slot == nullptr;
+    const bool made = *slot == nullptr; // otherwise an earlier registration is replaced
     if (made) {
         CHECK_STATUS(make_signal_event(context, slot));
     } else {

@@ -1,5 +1,5 @@
-// `lew`: the loop with the guarantees that the daemon relies on, over libevent. The operations stand in
-// runtime/loop_host.h, so that rooms below the daemon can use them.
+// `lew`: the event loop with the guarantees that the daemon needs, over libevent. Its operations are declared
+// in runtime/loop_host.h, so that lower rooms can use them.
 #pragma once
 
 #include <atomic>
@@ -7,5 +7,5 @@
 #include "runtime/loop_host.h"
 
 constexpr int LEW_SIGNAL_MAX = 65;
-// The context that owns each signal, by number; null for none.
+// The loop that has registered each signal, by signal number; null for none.
 extern std::atomic<loop_context *> le_signal_contexts[LEW_SIGNAL_MAX + 1];

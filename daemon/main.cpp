@@ -1,4 +1,4 @@
-// No argument has an effect on the daemon. The two that ask what it is are answered.
+// The daemon ignores its arguments, except for the two that ask for its help text or version.
 #include <cstdio>
 #include <cstring>
 

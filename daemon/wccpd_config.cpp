@@ -1,16 +1,17 @@
-// The configuration: read once at the start, then followed change by change while groups run.
+// The configuration: read completely at the start, then followed change by change while groups run.
 //
-// All configuration is held by mgmtd as bindings; the daemon keeps none of it but the table of policy
-// memberships. Two paths lead into the engine. The group path builds a whole wccp_grp_config from the subtree
-// of one group and adds the group, or deletes it: at the start for every group, later for a change that adds
-// or removes a group's root node. The node path looks at one changed binding at a time and modifies one field
-// of the running group. The table in wccpd_group_nodes.cpp defines what the nodes of a group mean.
+// mgmtd holds the configuration as bindings; the daemon keeps none of it except the table of policy
+// memberships. There are two paths into the engine. The group path builds a whole wccp_grp_config from the
+// subtree of a group and adds the group, or deletes the group. It is used for every group at the start, and
+// later for a change that adds or removes the root node of a group. The node path modifies one field of a
+// running group for each changed binding. The table in wccpd_group_nodes.cpp defines the nodes of a group for
+// both.
 //
-// A binding of the wrong type ends the walk of its array; what was applied before it stays. Nodes are looked
-// up by name through the index of the array, so the time that a start takes grows with the size of the tree
-// only.
+// A binding of the wrong type ends the walk of its array; what was applied before it stays. Nodes are found
+// by name through the index of the array, so that the time of the start grows linearly with the size of the
+// tree.
 //
-// Main thread only. Nothing here waits for mgmtd in the middle of a walk.
+// Main thread only. No function waits for mgmtd in the middle of a walk.
 #include "daemon/wccpd_config.h"
 
 #include <cstdio>
@@ -38,15 +39,15 @@ constexpr const char *GROUP_ROOTS = NODE_GROUP_CONFIG "/*";
 constexpr const char *POLICY_ROOTS = NODE_POLICY_CONFIG "/*";
 constexpr uint16_t ORPHANED_POLICY = 300; // where the members of a deleted policy group go
 
-// ---- The arrays of bindings
+// --- The arrays of bindings
 
 struct config_walk {
     const bn_binding_array *bindings;
     config_change_time time;
-    const uint32_t *router_entries; // number of router entries of the group whose root has that place
+    const uint32_t *router_entries; // number of router entries of a group, by the index of its root's binding
 };
 
-// A change of the start may concern a group that the answer already had, or no longer had.
+// Needed for a change during the start: the answer may have had its group already, or no longer.
 bool group_exists(uint8_t id) {
     const wccp_engine_lock lock;
     return wccp_find_group(id) != nullptr;
@@ -68,7 +69,7 @@ lc_status read_root_deleted_mark(const bn_binding_array *bindings, const char *r
     return LC_OK;
 }
 
-// The place of the group's root for the name of a router entry, -1 for any other name.
+// If `name` is a router entry, outputs the index of the binding of its group's root, otherwise -1.
 lc_status find_root_of_router_entry(const bn_binding_array *bindings, const char *name, int32_t *out_index) {
     constexpr std::string_view list = "/router";
     std::string_view root = name;
@@ -84,7 +85,7 @@ lc_status find_root_of_router_entry(const bn_binding_array *bindings, const char
     return LC_OK;
 }
 
-// All groups in one pass, since looking through the whole array for each of them takes too long at the start.
+// Counts for all groups in one pass: a pass for each group would take too long at the start.
 lc_status count_router_entries(const bn_binding_array *bindings, uint32_t *counts) {
     const uint32_t length = bn_binding_array_length_quick(bindings);
     for (uint32_t i = 0; i < length; i++) {
@@ -99,7 +100,7 @@ lc_status count_router_entries(const bn_binding_array *bindings, uint32_t *count
     return LC_OK;
 }
 
-// ---- Whole groups
+// --- Whole groups
 
 void delete_engine_group(uint8_t id, config_change_time time) {
     if (time != CONFIG_CHANGE_RUNNING && !group_exists(id))
@@ -110,7 +111,7 @@ void delete_engine_group(uint8_t id, config_change_time time) {
         QV_LOG(LC_LOG_ERR, "WCCP update: Failed to delete Group %d", id);
 }
 
-// As many entries as there are, with the numbers from 1; one that is missing among them is left out.
+// With N entries, looks for the numbers 1 to N. A gap in the numbers therefore loses the last entries.
 lc_status take_routers(const group_node *node, const config_walk *walk, const char *root,
                        wccp_grp_config *config) {
     int32_t place = -1;
@@ -145,14 +146,14 @@ lc_status wccpd_config_update_group(const char *id_text, const config_walk *walk
     CHECK_NULL(id_text);
     CHECK_NULL(walk);
     CHECK_NULL(root);
-    const uint8_t id = static_cast<uint8_t>(strtol(id_text, nullptr, 10));
+    const uint8_t id = static_cast<uint8_t>(strtol(id_text, nullptr, 10)); // the low 8 bits: 300 is group 44
     QV_LOG(LC_LOG_INFO, "WCCP config query group %s(%d) - %s", id_text, id, root);
     wccp_grp_config config = {};
     bool deleted = false;
     CHECK_STATUS(read_root_deleted_mark(walk->bindings, root, &deleted));
     if (deleted) {
         delete_engine_group(id, walk->time);
-        leave_policy_group(id);
+        leave_policy_group(id); // also when the group could not be deleted
         return LC_OK;
     }
     if (walk->time != CONFIG_CHANGE_RUNNING && group_exists(id)) {
@@ -164,7 +165,7 @@ lc_status wccpd_config_update_group(const char *id_text, const config_walk *walk
     if (wccp_add_group(&config) == 0)
         QV_LOG(LC_LOG_INFO, "Created WCCP group %d", id);
     else
-        QV_LOG(LC_LOG_ERR, "FAILED to create WCCP group %d", id);
+        QV_LOG(LC_LOG_ERR, "FAILED to create WCCP group %d", id); // the walk goes on with the next group
     return LC_OK;
 }
 
@@ -223,7 +224,7 @@ lc_status walk_groups(const bn_binding_array *bindings, config_change_time time,
     return LC_OK;
 }
 
-// ---- One changed node
+// --- One changed node
 
 lc_status change_facility(const bn_binding *binding) {
     uint32_t facility = 0;
@@ -232,7 +233,7 @@ lc_status change_facility(const bn_binding *binding) {
     LC_LOG(LC_LOG_INFO, "system facility to %d(%s), %s", static_cast<int>(facility >> 3), name,
            wccpd_program_name);
     (void)lc_log_file(nullptr, "system facility set to %s, %s", name, wccpd_program_name);
-    // Initialising forgets what management has set of the levels, which has nothing to do with the facility.
+    // lc_log_init resets the log levels that management has set. They do not depend on the facility.
     lc_log_levels levels;
     CHECK_STATUS(lc_log_save_levels(&levels));
     CHECK_STATUS(lc_log_init(wccpd_program_name, nullptr, 0, WCCPD_LOG_COMPONENT, LC_LOG_DEBUG,
@@ -260,8 +261,9 @@ const group_node *find_changing_node(const char *name) {
     return nullptr;
 }
 
-// A change that the answer contains leaves nothing to do where a running group could not follow it: the group
-// was made without the deleted node, and with the router entries, priority and protocol of the change.
+// Applies a changed or deleted node of a group. Some changes a running group cannot follow: a deleted node
+// deletes the group, and router entries, priority and protocol are fixed. If the answer contains the change
+// there is nothing to do for these, because the group was added with their new values.
 lc_status change_group(const char *name, const tstr_array *parts, const bn_binding *binding, bool deleted,
                        config_change_time time) {
     constexpr uint32_t GROUP_PART = 5, NODE_PART = 6, NODE_PARTS = 7;
@@ -270,12 +272,12 @@ lc_status change_group(const char *name, const tstr_array *parts, const bn_bindi
     const char *last =
         tstr_array_length_quick(parts) == NODE_PARTS ? tstr_array_get_str_quick(parts, NODE_PART) : nullptr;
     const group_node *node = last ? find_changing_node(last) : nullptr;
-    const bool known = node || (last && strcmp(last, "assign_detail") == 0);
+    const bool known = node || (last && strcmp(last, "assign_detail") == 0); // which has no effect
     if (time == CONFIG_CHANGE_IN_ANSWER && (deleted || !known)) {
         QV_LOG(LC_LOG_INFO, "WCCP update: %s was changed before the start read it", name);
         return LC_OK;
     }
-    if (deleted) {
+    if (deleted) { // any node: the whole group is deleted
         delete_engine_group(id, time);
         return LC_OK;
     }
@@ -329,13 +331,13 @@ lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_binding *b
     return LC_OK;
 }
 
-// The walk over an array ends with no other failure than this one.
+// The walk over an array ends only with this status.
 lc_status change_or_halt(bn_binding_array *bindings, uint32_t index, bn_binding *binding, void *data) {
     return wccpd_config_handle_change(bindings, index, binding, data) == LC_OK ? LC_OK
                                                                                : LC_FOREACH_HALT_ERROR;
 }
 
-// ---- The whole, at the start and in a change event
+// --- The whole configuration, and a change event
 
 lc_status query_tree(const char *root, owned_bindings *out) {
     CHECK_STATUS(mdc_get_binding_children(wccpd_mcc, nullptr, nullptr, 1, &out->pointer, 0, 1, root));
@@ -365,9 +367,9 @@ lc_status query_roots(const char *root,
 
 lc_status wccpd_config_query() {
     forget_policy_memberships();
-    CHECK_STATUS(query_nodes(NODE_SYSTEM_CONFIG));
+    CHECK_STATUS(query_nodes(NODE_SYSTEM_CONFIG)); // the system mode takes effect before there are groups
     CHECK_STATUS(query_nodes(NODE_WCCPD_CONFIG));
-    (void)qv_init_log_level(wccpd_mcc);
+    (void)qv_init_log_level(wccpd_mcc); // without it the levels stay as they are
     CHECK_STATUS(query_roots(NODE_POLICY_CONFIG, walk_policy_groups));
     CHECK_STATUS(query_roots(NODE_GROUP_CONFIG, walk_groups));
     return LC_OK;
@@ -380,7 +382,7 @@ lc_status wccpd_config_apply(bn_binding_array *new_values, config_change_time ti
     QV_LOG(LC_LOG_INFO, "WCCP Group policy config callbacks: %d", static_cast<int>(count));
     CHECK_STATUS(walk_groups(new_values, time, &count));
     QV_LOG(LC_LOG_INFO, "WCCP Group config callbacks: %d", static_cast<int>(count));
-    if (count != 0)
+    if (count != 0) // the event adds or deletes a group: single nodes in it are not applied
         return LC_OK;
     CHECK_STATUS(bn_binding_array_foreach(new_values, change_or_halt, &time));
     QV_LOG(LC_LOG_INFO, "WCCP Modify config complete");

@@ -1,3 +1,4 @@
+// A list of changes in the order of their arrival.
 #include "daemon/wccpd_early_changes.h"
 
 #include <cstdlib>
@@ -7,8 +8,9 @@
 
 namespace {
 
-constexpr size_t CHANGE_BYTES = 512;  // of a change and its array
-constexpr size_t BINDING_BYTES = 512; // of a binding, its attribute and their arrays
+// Estimates.
+constexpr size_t CHANGE_BYTES = 512;  // a change and its array
+constexpr size_t BINDING_BYTES = 512; // a binding, its attribute and their arrays
 
 struct early_change {
     early_change *next;
@@ -18,7 +20,7 @@ struct early_change {
 
 struct early_change_list {
     early_change *first;
-    early_change **end; // where the next one goes; null when no changes are kept
+    early_change **end; // the null pointer at the end of the list; null while changes are not kept
     size_t bytes;
 };
 early_change_list kept_changes;

@@ -1,8 +1,8 @@
-// What each configuration node of a service group means.
+// The configuration nodes of a service group.
 //
-// Every node is one row of `group_nodes`; both paths of the configuration (wccpd_config.cpp) take the rows
-// from there. A bad word is no failure: it is logged, and the row's fallback is used instead. A binding of
-// the wrong type is a failure.
+// Each node is a row of `group_nodes`, which both paths of the configuration (wccpd_config.cpp) use. An
+// invalid word is not a failure: it is logged and replaced by the row's fallback. A binding of the wrong type
+// is a failure.
 #include "daemon/wccpd_group_nodes.h"
 
 #include <cstdlib>
@@ -22,8 +22,8 @@ struct group_node_words {
         uint32_t value;
     };
     std::span<const word> list;
-    uint32_t fallback; // for a bad word; 0: the node is ignored
-    void (*complain)(const char *text);
+    uint32_t fallback;                  // for an invalid word; 0: the node is ignored
+    void (*complain)(const char *text); // logs the invalid word
 };
 
 namespace {
@@ -78,7 +78,7 @@ lc_status take_router(const group_node *node, wccp_grp_config *config, const bn_
     uint32_t address = 0;
     CHECK_STATUS(bn_binding_get_ipv4addr(binding, bn_attrib_value, nullptr, &address));
     config->config_flags |= node->flag;
-    for (uint16_t i = 0; i < WCCP_MAX_ROUTERS; i++) {
+    for (uint16_t i = 0; i < WCCP_MAX_ROUTERS; i++) { // the first free entry; a 33rd router is dropped
         if (!is_zero(config->routers[i]))
             continue;
         config->routers[i] = to_be32(address);
@@ -95,7 +95,7 @@ lc_status take_protocol(const group_node *, wccp_grp_config *config, const bn_bi
     CHECK_STATUS(wccpd_read_text(binding, &text));
     const char *string = ts_str(text.pointer);
     long number = ip_protocol_by_name(string);
-    if (number < 0)
+    if (number < 0) // not the name of a protocol
         number = strtol(string, nullptr, 10);
     if (number < 1 || number > 255) {
         QV_LOG(LC_LOG_ERR, "Bad wccp protocol: %s", string);
@@ -109,7 +109,7 @@ lc_status take_protocol(const group_node *, wccp_grp_config *config, const bn_bi
 lc_status take_password(const group_node *node, wccp_grp_config *config, const bn_binding *binding) {
     owned_tstring text;
     CHECK_STATUS(wccpd_read_text(binding, &text));
-    memset(config->password, 0, sizeof config->password);
+    memset(config->password, 0, sizeof config->password); // the digest is computed over all 8 bytes
     strlcpy(config->password, ts_str(text.pointer), sizeof config->password);
     config->config_flags |= node->flag;
     util_log(LC_LOG_INFO, CONFIG_LOG_PREFIX, "set password");
@@ -132,7 +132,7 @@ lc_status take_policy(const group_node *, wccp_grp_config *config, const bn_bind
     const uint8_t id = config->group_id;
     if (svc_grp_policy[id] != 0)
         (void)wccp_remove_policy_grp(svc_grp_policy[id], id);
-    svc_grp_policy[id] = policy;
+    svc_grp_policy[id] = policy; // also if the next step fails
     if (wccp_add_policy_grp(policy, 1, &id) != 0)
         util_log(LC_LOG_ERR, CONFIG_LOG_PREFIX, "Failed set policy grp to %d", policy);
     else
@@ -184,16 +184,16 @@ constexpr group_node rows[] = {
     {GROUP_NODE_FORCE_L2_RETURN, "force_l2_return", true, WCCP_CFG_FORCE_L2_RETURN, take_bool,
      SET_FIELD(force_l2_return), LOG_VALUE("set force l2 return to %s", text), nullptr},
     {GROUP_NODE_INTERFACE, "interface", true, 0, take_interface, nullptr, nullptr, nullptr},
-    {GROUP_NODE_ASSIGN_METHOD, "assign_method", true, WCCP_CFG_ASSIGN_METHOD, take_word, SET_FIELD(assign_method),
-     LOG_VALUE("set assignment method to %s", text), &assign_words},
+    {GROUP_NODE_ASSIGN_METHOD, "assign_method", true, WCCP_CFG_ASSIGN_METHOD, take_word,
+     SET_FIELD(assign_method), LOG_VALUE("set assignment method to %s", text), &assign_words},
     {GROUP_NODE_HASH_SRC_IP, "hash_src_ip", true, WCCP_CFG_HASH_SRC_IP, take_bool, SET_FIELD(hash_src_ip),
      LOG_VALUE("set hash src ip to %s", text), nullptr},
     {GROUP_NODE_HASH_DST_IP, "hash_dst_ip", true, WCCP_CFG_HASH_DST_IP, take_bool, SET_FIELD(hash_dst_ip),
      LOG_VALUE("set hash dst ip to %s", text), nullptr},
-    {GROUP_NODE_HASH_SRC_PORT, "hash_src_port", true, WCCP_CFG_HASH_SRC_PORT, take_bool, SET_FIELD(hash_src_port),
-     LOG_VALUE("set hash src port to %s", text), nullptr},
-    {GROUP_NODE_HASH_DST_PORT, "hash_dst_port", true, WCCP_CFG_HASH_DST_PORT, take_bool, SET_FIELD(hash_dst_port),
-     LOG_VALUE("set hash dst port to %s", text), nullptr},
+    {GROUP_NODE_HASH_SRC_PORT, "hash_src_port", true, WCCP_CFG_HASH_SRC_PORT, take_bool,
+     SET_FIELD(hash_src_port), LOG_VALUE("set hash src port to %s", text), nullptr},
+    {GROUP_NODE_HASH_DST_PORT, "hash_dst_port", true, WCCP_CFG_HASH_DST_PORT, take_bool,
+     SET_FIELD(hash_dst_port), LOG_VALUE("set hash dst port to %s", text), nullptr},
     {GROUP_NODE_MASK_SRC_IP, "mask_src_ip", true, WCCP_CFG_MASK_SRC_IP, take_number, SET_FIELD(mask_src_ip),
      LOG_VALUE("set mask src ip to 0x%x", value), nullptr},
     {GROUP_NODE_MASK_DST_IP, "mask_dst_ip", true, WCCP_CFG_MASK_DST_IP, take_number, SET_FIELD(mask_dst_ip),
@@ -202,8 +202,9 @@ constexpr group_node rows[] = {
      SET_FIELD(mask_src_port), LOG_VALUE("set mask src port to 0x%x", value), nullptr},
     {GROUP_NODE_MASK_DST_PORT, "mask_dst_port", true, WCCP_CFG_MASK_DST_PORT, take_port_mask,
      SET_FIELD(mask_dst_port), LOG_VALUE("set mask dst port to 0x%x", value), nullptr},
-    {GROUP_NODE_COMPATIBILITY, "compatibility", true, WCCP_CFG_COMPATIBILITY, take_word, SET_FIELD(compatibility),
-     LOG_VALUE("set compatibility mode to %s(%d)", text, static_cast<int>(value)), &compatibility_words},
+    {GROUP_NODE_COMPATIBILITY, "compatibility", true, WCCP_CFG_COMPATIBILITY, take_word,
+     SET_FIELD(compatibility), LOG_VALUE("set compatibility mode to %s(%d)", text, static_cast<int>(value)),
+     &compatibility_words},
 };
 // clang-format on
 

@@ -1,5 +1,5 @@
-// The configuration nodes of a service group: the name of each, the field of wccp_grp_config that it fills,
-// and the policy group that a service group belongs to. Main thread only.
+// The configuration nodes of a service group: the name of each and the field of wccp_grp_config that it sets;
+// and the table of policy memberships. Main thread only.
 #pragma once
 
 #include <cstdint>
@@ -11,7 +11,7 @@
 
 constexpr const char *CONFIG_LOG_PREFIX = "WCCP config: ";
 
-// The numbers are those that wccpd_config_update_group_binding takes; there is no 12.
+// The kinds of nodes, as wccpd_config_update_group_binding takes them. There is no 12.
 enum group_node_kind : int {
     GROUP_NODE_ADMIN = 1,
     GROUP_NODE_ROUTER = 2,
@@ -35,14 +35,15 @@ enum group_node_kind : int {
     GROUP_NODE_COMPATIBILITY = 21,
 };
 
-struct group_node_words; // the words that a node's value may be, and what each means
+struct group_node_words; // the words that are valid for a node, and their values
 
 struct group_node {
     group_node_kind kind;
-    const char *name; // below the group's root; null for a router's address, whose name has a number in it
-    bool changes;     // a change of this node alone is applied to a running group
-    uint32_t flag;    // of config_flags; 0 for none
-    // Fills the field from the binding, as wccpd_config_update_group_binding does; the rest is for its use.
+    const char *name; // below the group's root; null for a router's address, whose name contains a number
+    bool changes;     // a change of this node can be applied to a running group
+    uint32_t flag;    // WCCP_CFG_*, 0 for none
+    // Sets the field from the binding, like wccpd_config_update_group_binding. The members below are for its
+    // use.
     lc_status (*take)(const group_node *node, wccp_grp_config *config, const bn_binding *binding);
     void (*set)(wccp_grp_config *config, uint32_t value);
     void (*log)(const char *text, uint32_t value);
@@ -52,11 +53,12 @@ struct group_node {
 // One row for each node, in the order in which the nodes of a new group are read.
 extern const std::span<const group_node> group_nodes;
 
-// Fills the field of that kind of node from the binding. A binding of the wrong type gives a status.
+// Sets the field for a kind of node from the binding. An invalid word is logged and replaced; an unknown kind
+// is logged. Only a binding of the wrong type gives a failure.
 lc_status wccpd_config_update_group_binding(wccp_grp_config *config, const bn_binding *binding, int kind);
 
-// The policy group of each service group, 0 for none. Kept here as well as in the engine, because taking a
-// service group out of a policy group needs the old number.
-void forget_policy_memberships();
-void leave_policy_group(uint8_t group_id);
+// The policy group of each service group, 0 for none. The table is kept here besides the engine's, because
+// removing a service group from its policy group needs the policy group's number.
+void forget_policy_memberships();          // clears the table
+void leave_policy_group(uint8_t group_id); // removes the service group from its policy group
 void move_policy_members(uint16_t from, uint16_t to);

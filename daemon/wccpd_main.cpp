@@ -1,32 +1,29 @@
-// The spine of the daemon: the fixed order in which everything is brought up, the loop that the main thread
-// sits in for the rest of its life, and the order in which everything is taken down.
+// The start, the loop and the exit of the daemon, in their fixed order.
 //
-// Everything here runs on the main thread. It is the only thread that takes signals: all others block them,
-// so that no sleep or wait of theirs is cut short. Signals and management messages are callbacks on the loop,
-// and a callback may wait for mgmtd by running the loop again from inside itself (wccpd_mgmt.cpp);
-// wccpd_initiate_exit can therefore run nested in such a wait, and every wait ends by itself once
+// Everything here runs on the main thread, the only one that receives signals: all others block them, so that
+// none of their sleeps or waits is interrupted. Signals and management messages are callbacks of the loop. A
+// callback may wait for mgmtd by running the loop again from inside itself (wccpd_mgmt.cpp).
+// wccpd_initiate_exit can therefore run nested in such a wait; every wait ends once wccpd_exiting is set.
+//
+// Start. The engine asks mgmtd for the system mode and the primary interface, so the session must be open
+// before it; the alarm session must be open before the engine can raise an alarm. m_daemon_status alone shows
+// how far the start has come. Until it is WCCPD_READY, queries are dropped and configuration changes are kept
+// (wccpd_early_changes.h). A start that fails does not end the process: it stays in its loop, not ready and
+// ignoring changes, until a signal ends it. Only a missing privilege ends it at once.
+//
+// Exit. Alarms are cleared while their session is open. Then the alarm session and its thread end, the signal
+// registrations are removed, the working session is closed, and the mailbox is reset. Groups are still
+// running at this point, with the tick idle; wccpd_deinit deletes them once the loop has returned. The daemon
+// never reconnects and never repairs anything; whatever launched it starts it again.
+//
+// The notifier thread of the platform's library runs until exit() has finished and can call into the engine
+// until then. Therefore the engine's records have no destructors, and its callbacks return at once when
 // wccpd_exiting is set.
 //
-// The order of the start is fixed: the engine asks mgmtd for the system mode and the primary interface, so it
-// needs the session, and the alarm session must exist before the engine can raise anything. m_daemon_status
-// alone says how far the start has come. Until it is WCCPD_READY, queries are dropped and changes of the
-// configuration are kept (wccpd_early_changes.h). A start that fails does not end the process, which sits in
-// its loop, never ready and ignoring changes, until a signal arrives; only without a privilege that it needs
-// it exits at once.
-//
-// The order of the exit: alarms are cleared while their session is open; then that session and its thread
-// end, the signal registrations are removed, the working session is closed, and the mailbox is reset. Groups
-// still run then, with the tick idle; wccpd_deinit stops them once the loop has returned. Nothing is ever
-// reconnected or repaired: whoever started the daemon starts it again.
-//
-// The closed library's thread lives until exit() is through and may call into the engine to the last: the
-// engine's records are plain objects without destructors, and the callbacks return at once when wccpd_exiting
-// is set.
-//
-// All memory is locked, so every mapped page counts, read or not: threads have small stacks
-// (engine/cthread.cpp), malloc one arena and no memory for what large buffers needed once, received bindings
-// no second copy of their names. scripts/memory.sh shows what is locked, by component; bench/daemon_start.sh
-// at full size.
+// All memory is locked, so every mapped page counts whether it is used or not. Threads have small stacks
+// (engine/cthread.cpp), malloc has one arena and returns large buffers to the kernel, and received bindings
+// share their names. scripts/memory.sh shows locked memory by component; bench/daemon_start.sh measures at
+// full size.
 #include "daemon/wccpd_main.h"
 
 #include <cerrno>
@@ -79,7 +76,7 @@ namespace {
 
 constexpr const char *WCCPD_PID_FILE = "/var/run/wccpd.pid";
 
-// The signals that the daemon takes, in the order of their registration and removal.
+// The signals that the daemon handles, in the order of their registration and removal.
 struct wccpd_signal {
     int number;
     bool ends_daemon;
@@ -94,8 +91,8 @@ lc_status wccpd_alarms_init() {
     return qv_alm_mgmt_init(wccpd_program_name);
 }
 
-// The steps in which the start waits for mgmtd. An exit that begins in one of them ends the start there:
-// nothing may be brought up after the rest has been taken down.
+// The steps of the start that wait for mgmtd. If an exit begins during one of them, the start ends there:
+// nothing may be started after the exit.
 lc_status (*const wccpd_start_steps[])() = {
     wccpd_mgmt_init,
     wccpd_alarms_init,
@@ -149,8 +146,8 @@ lc_status wccpd_pid_init() {
 
 lc_status wccpd_serv_init() {
     CHECK_CONDITION(wccpd_lwc != nullptr);
-    // The engine's threads order tunnels as soon as the first group has found its router, which can be while
-    // later groups are still being made: they need the ids before wccpd_init logs them.
+    // The engine's threads create tunnels as soon as a group has found a router, which can happen while later
+    // groups are still being added. They need the range of ids before wccpd_init computes it again to log it.
     (void)qv_encap_setup_entries();
     return wccp_init_mgr();
 }
@@ -161,7 +158,7 @@ lc_status wccpd_init() {
     CHECK_STATUS(lc_log_init(wccpd_program_name, nullptr, 0, WCCPD_LOG_COMPONENT, LC_LOG_DEBUG, facility, 1));
     LC_LOG(LC_LOG_NOTICE, "WCCP daemon launched");
     LC_LOG(LC_LOG_DEBUG, "wccpd version %s", wccp_version());
-    if (wccpd_report_missing_privileges() > 0) { // waiting would not bring them
+    if (wccpd_report_missing_privileges() > 0) { // they cannot appear while the process runs
         (void)lc_log_close();
         exit(EXIT_FAILURE);
     }
@@ -220,14 +217,14 @@ lc_status wccpd_deinit() {
 
 int wccpd_main() {
     (void)mlockall(MCL_CURRENT | MCL_FUTURE);
-    // All mapped memory is locked. Each thread that allocates would map an arena of 64 MB of its own; and by
-    // default malloc keeps on the heap what is as large as anything freed before, which the buffers of the
-    // start's answers make some megabytes.
+    // All mapped memory is locked. By default each thread that allocates maps an arena of 64 MB, and malloc
+    // raises its mmap threshold to the largest block freed so far, which after the answers of the start would
+    // keep some megabytes on the heap.
     (void)mallopt(M_ARENA_MAX, 1);
     (void)mallopt(M_MMAP_THRESHOLD, 128 << 10);
     (void)mallopt(M_TRIM_THRESHOLD, 128 << 10);
     const lc_status first = lc_init();
-    if (first != LC_OK) {
+    if (first != LC_OK) { // the only failure of the start that ends the process with its status
         LOG_STATUS(first);
         exit(first);
     }

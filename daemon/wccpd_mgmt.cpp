@@ -1,11 +1,12 @@
-// The working session with mgmtd: how it is opened, which events are asked for, and what each message does.
+// The working session with mgmtd: how it is opened, which events it subscribes to, and what each message
+// does.
 //
-// Everything here runs on the main thread inside the loop, and nests: a request of the daemon's own is waited
-// for by running the loop again (mgmt/client_session.h), so that events, queries and the loss of the session
-// are handled in the middle of it. Only changes of the configuration are not handled there during the start:
-// they are kept until the start has read all of it. Handlers run inside the session's recursive locks; the
-// engine lock is taken after them, inside the engine. A failing handler never ends the session. The session
-// is never reconnected: its loss, or the news that tunneld has gone, begins the exit.
+// Everything runs on the main thread inside the loop, and nests: the daemon waits for the answer to a request
+// of its own by running the loop again (mgmt/client_session.h), so events, queries and the loss of the
+// session are handled in the middle of the wait. The exception are configuration changes during the start,
+// which are kept until the whole configuration has been read. Handlers run with the session's recursive locks
+// held; the engine takes its lock after them. A handler that fails does not end the session. The session is
+// never reopened: when it is lost, or when mgmtd reports the end of tunneld, the daemon exits.
 #include "daemon/wccpd_mgmt.h"
 
 #include <cstring>
@@ -51,7 +52,7 @@ lc_status wccpd_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request,
 
 lc_status wccpd_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
     CHECK_STATUS(mgmt_client_response(&wccpd_client, response));
-    early_changes_are_answered();
+    early_changes_are_answered(); // changes that arrived before the answer are contained in it
     return LC_OK;
 }
 
@@ -64,7 +65,7 @@ lc_status wccpd_mgmt_handle_query_request(gcl_session *session, bn_request_msg *
         LC_LOG(LC_LOG_INFO, "Discard event req because init not ready");
         return LC_OK;
     }
-    bool in_walk = false;
+    bool in_walk = false; // mgmtd asks for a whole subtree
     for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(request->nodes); i++)
         in_walk =
             in_walk || bn_request_per_node_array_get_quick(request->nodes, i)->subop == bn_query_iterate;
@@ -143,15 +144,15 @@ lc_status wccpd_mgmt_handle_event_request(gcl_session *, bn_request_msg *request
             CHECK_STATUS(known.handle(name, bindings.pointer));
             return LC_OK;
         }
-    if (qv_handle_time_zone_change(name) != LC_OK)
+    if (qv_handle_time_zone_change(name) != LC_OK) // not that event either
         LC_LOG(LC_LOG_WARNING, "Received unexpected event %s", name);
     return LC_OK;
 }
 
 lc_status wccpd_mgmt_handle_session_close(int, uint32_t, void *, void *) {
-    if (wccpd_exiting)
+    if (wccpd_exiting) // the daemon closed it itself
         return LC_OK;
-    wccpd_response_expected = 0;
+    wccpd_response_expected = 0; // ends the wait of a request
     LC_LOG(LC_LOG_ERR, "Lost connection to mgmtd; exiting");
     CHECK_STATUS(wccpd_initiate_exit());
     return LC_OK;

@@ -1,12 +1,12 @@
-// Monitoring: mgmtd asks for a node by name and gets at most one binding, or for a node's children and gets
-// names.
+// Monitoring: mgmtd gets a node by name, which gives at most one binding, or iterates over a node, which
+// gives the names of its children.
 //
-// Nothing is cached. Each request goes to the engine's queries, which take the engine lock for their own
-// length, and the answer is rendered here: every node is a row that says what it is asked of and how its
-// value is written. The text nodes carry the engine's dumps in buffers that live for the one request.
+// Nothing is cached. Each request calls the engine's queries, which take the engine lock for themselves, and
+// formats the answer here. Each node is a row that defines what to ask and how to format the value. The text
+// nodes contain the engine's dumps, in buffers that are allocated for the request.
 //
-// Main thread only, and only once the daemon is ready. Router and appliance numbers are places in a list at
-// the moment of the request and may name somebody else at the next.
+// Main thread only, and only once the daemon is ready. Router and appliance numbers are positions in a list
+// at the moment of the request, and may belong to another one at the next.
 #include "daemon/wccpd_monitor.h"
 
 #include <cinttypes>
@@ -29,10 +29,11 @@
 
 namespace {
 
-// Parts of a name below the root of the groups' state, counted from 0, and below the system's.
+// Indexes of parts of a node's name: below the state of the groups, and the last one below that of the
+// system.
 enum : uint32_t { GROUP_PART = 5, NUMBER_PART = 7, ADDRESS_PART = 9, SYSTEM_ENTRY_PART = 5 };
 
-// What a request is about, and what the engine said of it.
+// A request, and what the engine has answered.
 struct mon_subject {
     const char *name;
     const tstr_array *parts;
@@ -49,16 +50,16 @@ struct mon_value {
     char text[160];
 };
 struct mon_dump {
-    uint32_t size;
+    uint32_t size; // bytes of the buffer
     int (*print)(csys_display_buf *buffer, uint8_t group);
-    bool cut_text_counts; // what was written is the value even when it did not fit
+    bool cut_text_counts; // a text that did not fit is a valid value
 };
 struct mon_node {
     const char *pattern;
     uint32_t type;
     void (*value)(const mon_subject *subject, mon_value *out);
     const mon_dump *dump;
-    // What else is to be asked for the value; no value when `answered` becomes false.
+    // Queries the engine for this node in particular; there is no value when `answered` becomes false.
     void (*ask)(mon_subject *subject, bool *answered) = nullptr;
 };
 
@@ -75,12 +76,12 @@ void put_words(mon_value *out, const char *words) {
     strlcpy(out->text, words, sizeof out->text);
 }
 
-// A number that is one of very many.
+// For counters, which may exceed INT_MAX.
 void put_count(mon_value *out, uint32_t number) {
     snprintf(out->text, sizeof out->text, "%u", number);
 }
 
-// An address that is none is nobody's: no binding, as for an appliance that the router doesn't list.
+// An invalid address gets no binding, like an appliance that the router does not list.
 void ask_load(mon_subject *subject, bool *answered) {
     uint32_t address = 0;
     wccp_router_appliance_info info = {};
@@ -163,7 +164,7 @@ const mon_dump owners_dump = {WCCP_OWNERS_BYTES,
 #define INTERFACE_NODE(node, type, value)                                                                    \
     { NODE_WCCPD_STATE "/interface/*/" node, type, WRITE_VALUE(value), nullptr, ask_interface }
 
-// First match wins.
+// The first row whose pattern matches is used.
 const mon_node mon_nodes[] = {
     {NODE_WCCPD_STATE "/proto_ver", bn_type_str, WRITE_VALUE(put_words(out, "2.0")), nullptr},
     {NODE_WCCPD_VERSION, bn_type_str, WRITE_VALUE(put_words(out, wccp_version())), nullptr},
@@ -222,7 +223,8 @@ const mon_node mon_nodes[] = {
     INTERFACE_NODE("address_changes", bn_type_uint32, put_count(out, s->interface.address_changes)),
 };
 
-// Nodes that exist so that what iterate finds can be listed; they answer with their own last part.
+// Nodes that exist only so that the children which iterate finds can be listed. Their value is their last
+// name part.
 const char *const wildcard_nodes[] = {
     NODE_GROUP_STATE "/*",
     NODE_GROUP_STATE "/*/router/*",
@@ -248,7 +250,8 @@ lc_status wccpd_mon_handle_get_wildcard(const mon_subject *subject, const char *
     return LC_OK;
 }
 
-// Asks the engine for what the name is about. `answered` stays false where there is nothing to say.
+// Queries the engine for the group, router or appliance in the name. `answered` becomes false when there is
+// none.
 lc_status ask_engine(mon_subject *subject, bool *answered) {
     char routers[64], appliances[64], router_appliances[96];
     *answered = true;
@@ -257,7 +260,7 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
     subject->group = static_cast<uint8_t>(get_number_part(subject, GROUP_PART));
     const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
     const int group = static_cast<int>(group_text ? strtol(group_text, nullptr, 10) : 0);
-    // The parents themselves count as well: a get of one finds no number after it.
+    // These are prefixes of text, so they match the parent nodes themselves, too; their numbers are then 0.
     snprintf(routers, sizeof routers, "%s/%d/router", NODE_GROUP_STATE, group);
     snprintf(appliances, sizeof appliances, "%s/%d/appliance", NODE_GROUP_STATE, group);
     if (!lc_is_prefix(routers, subject->name, 0)) {
@@ -309,7 +312,7 @@ lc_status append_dump(const mon_subject *subject, const mon_node *node, bool in_
     }
     csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.pointer, dump->size);
     CHECK_NULL(buffer);
-    const dump_failures_logged_at level(in_walk ? LC_LOG_INFO : LC_LOG_ERR);
+    const dump_failures_logged_at level(in_walk ? LC_LOG_INFO : LC_LOG_ERR); // for this dump
     if (dump->print(buffer, subject->group) != 0 && !dump->cut_text_counts)
         return LC_OK;
     CHECK_STATUS(append_binding(subject->name, node->type, csys_display_buf_text(buffer), out));
@@ -404,7 +407,7 @@ lc_status iterate_routers(const mon_subject *subject, tstr_array *out) {
 
 lc_status append_reasons(int group, tstr_array *out) {
     wccp_reason_list list = {};
-    (void)wccp_get_reason_list(group, &list); // a group that is gone has none
+    (void)wccp_get_reason_list(group, &list); // a group that has been deleted has none
     for (uint32_t i = 0; i < list.count; i++)
         CHECK_STATUS(append_number(out, list.places[i]));
     return LC_OK;

@@ -1,13 +1,13 @@
-// The privileges of the daemon are few. Its port is above those of root, and it makes no links: that is
-// tunneld's. What it needs is that its memory may be locked, and that mgmtd lets it in.
+// The daemon needs few privileges: its port does not need root, and network interfaces are tunneld's
+// business. It needs permission to lock its memory and access to mgmtd.
 //
-// All memory is locked as it is mapped. Under a limit below what is needed in the end, threads do not start,
-// groups are not made and blocks cannot be attached, now or in a week. Hence a limit counts as a missing
-// privilege even where it would do for the moment.
+// All memory is locked when it is mapped. With a limit below what the daemon needs in the end, threads cannot
+// be created, groups cannot be added and shared memory cannot be attached, at some point in its life. A limit
+// therefore counts as a missing privilege even if it would suffice at first.
 //
-// Reports of being alive come from a timer on the main loop, which also tries the engine's lock. An engine
-// that holds it for long, because tunneld lets it wait for each of many tunnels, is not dead yet; the unit
-// gives it the time.
+// Keep-alive messages are sent by a timer of the main loop, which also tries to take the engine lock. An
+// engine that holds it for long, because it waits for tunneld for each of many tunnels, is not dead; the
+// watchdog period of the unit allows for that.
 #include "daemon/wccpd_service.h"
 
 #include <cerrno>
@@ -29,7 +29,7 @@
 
 namespace {
 
-constexpr int64_t CHECKS_IN_LIMIT = 24; // at the lock, within the time of the watchdog
+constexpr int64_t CHECKS_IN_LIMIT = 24; // tries to take the lock within the watchdog period
 constexpr size_t TEXT_BYTES = 256;
 
 loop_event *alive_timer;
@@ -45,8 +45,8 @@ bool may_lock_memory(char *out_missing) {
     return false;
 }
 
-// mgmtd lets in root and its own user, and nobody else may write to its socket. Without a socket there is
-// no mgmtd yet, which is another matter.
+// mgmtd accepts root and its own user; others cannot write to its socket. If the socket does not exist, mgmtd
+// is not running yet, which is not a matter of privileges.
 bool may_reach_mgmtd(char *out_missing) {
     char path[sizeof(sockaddr_un::sun_path)];
     gcl_socket_path("provider", "mgmtd", path, sizeof path);

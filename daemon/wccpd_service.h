@@ -1,11 +1,12 @@
-// The daemon as a service: whether it may do what it has to, and that it is alive.
+// The daemon as a system service: its privileges, readiness and watchdog.
 #pragma once
 
 #include "runtime/common.h"
 
-// How many privileges are missing. Each is reported in the log and on standard error, with what it is for.
+// Returns the number of missing privileges. Each is reported in the log and on standard error.
 int wccpd_report_missing_privileges();
-// Reports that the daemon is ready, and from then on that it is alive: that its loop goes round and that the
-// engine's lock is free again and again. Main thread.
+// Notifies the service manager that the daemon is ready, and if it has a watchdog, from then on periodically
+// that the daemon is alive: that its loop is running and the engine lock is released from time to time. Main
+// thread.
 lc_status wccpd_service_ready();
-void wccpd_service_deinit(); // before the loop is freed
+void wccpd_service_deinit(); // call it before the loop is freed

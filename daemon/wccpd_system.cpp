@@ -1,6 +1,6 @@
-// What the engine asks about the system and mgmtd knows: whether it is a bridge, and which interface is the
-// primary WAN interface, chosen by the mode of the system and the bonding and speed of its ports. Main
-// thread, from the engine's start.
+// Facts about the system that the engine needs and mgmtd knows: whether it is a bridge, and the primary WAN
+// interface, which follows from the system mode and from the bonding and speed of its ports. Called by the
+// main thread during the engine's start; each read waits for mgmtd.
 #include <cstring>
 
 #include "daemon/wccpd_main.h"
@@ -16,7 +16,7 @@ char wccp_primary_wan_interface_name[32];
 
 namespace {
 
-// A node that is absent leaves `out` as it is.
+// If the node does not exist, `out` stays as it is.
 lc_status read_bool_node(mdc *handle, const char *node, int32_t *out, bool *out_present) {
     *out_present = false;
     owned_binding binding;

@@ -1,18 +1,18 @@
 // Named threads.
 //
-// A context belongs to whoever made it until cthread_join frees it. While its thread may still have to be
-// ended it is on the process's thread list, which has a mutex of its own; that mutex is a leaf, and is
-// not held while a thread is waited for.
+// A context belongs to its creator until cthread_join frees it. While its thread is running and has not been
+// cancelled, the context is also on the process's thread list. The list has a mutex of its own, under which
+// no other lock is taken and no thread is waited for.
 //
-// Signals: every thread made here is born with all signals blocked, so a signal to the process always goes to
-// the main thread and no sleep or wait of the engine is cut short by one.
+// Signals: all signals are blocked in these threads, so that only the main thread receives them and no sleep
+// or wait of the engine is cut short.
 //
-// Stacks: all memory of the process is locked, so a stack costs what it reserves. 128 KiB hold a packet of
-// 4 KiB, the buffers of a log line and the deepest path of the engine several times over.
+// Stacks: all memory of the process is locked, so the whole stack counts, used or not. 128 KiB is several
+// times what the deepest path of the engine needs with a packet of 4 KiB and the buffers of a log line.
 //
-// Ending: cancel first, join afterwards, in two steps, so that a caller can cancel under a lock for which the
-// threads may be waiting, let go of the lock, and only then wait for their end. All threads are cancelled
-// before the first one is waited for: the end of many takes no longer than the end of the slowest.
+// Ending takes two steps, cancelling and joining. A caller can cancel while it holds a lock that the threads
+// may be waiting for, release the lock, and then join. All threads are cancelled before the first is joined,
+// so that the whole takes as long as the slowest one.
 
 #include "engine/cthread.h"
 
@@ -59,7 +59,7 @@ void *thread_main(void *argument) {
         QV_LOG(LC_LOG_ERR, "%s: can't set priority for thread %s\n", __func__, context->name);
     cpu_set_t cpus;
     CPU_ZERO(&cpus);
-    if (context->cpu < CPU_LIMIT)
+    if (context->cpu < CPU_LIMIT) // otherwise the set stays empty, which the call below refuses
         CPU_SET(context->cpu, &cpus);
     if (sched_setaffinity(0, sizeof cpus, &cpus) != 0)
         QV_LOG(LC_LOG_ERR, "%s: can't set affinity for thread %s\n", __func__, context->name);
@@ -113,7 +113,7 @@ int cthread_start(cthread *context) {
         return 1;
     sigset_t all, previous;
     sigfillset(&all);
-    pthread_sigmask(SIG_SETMASK, &all, &previous);
+    pthread_sigmask(SIG_SETMASK, &all, &previous); // the new thread inherits the mask
     const int error = pthread_create(&context->thread, &context->attributes, thread_main, context);
     pthread_sigmask(SIG_SETMASK, &previous, nullptr);
     if (error != 0) {
@@ -146,7 +146,7 @@ void cancel_thread(cthread *context) {
 } // namespace
 
 void cthread_cancel(cthread *context) {
-    if (!context || context->heartbeat == 0)
+    if (!context || context->heartbeat == 0) // 0: never started
         return;
     const mutex_guard guard(&thread_list_mutex);
     remove_from_thread_list(context);

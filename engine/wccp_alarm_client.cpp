@@ -1,22 +1,22 @@
-// The client session of the alarms, on a thread of its own.
+// The management session on which alarms and state events are sent, and its thread.
 //
-// Alarms and state events are sent from the engine's timer and receive threads, which never touch the
-// daemon's working session; so they have a session of their own. The alarm thread does nothing but run that
-// session's loop: it reads acknowledgements, writes what a full socket left over and notices a lost
-// connection. Senders go straight to the session, under the engine lock and then the locks of this client's
-// own GCL instance; a change of interest that they need is posted to the loop and carried out on the alarm
-// thread, so that nobody holds those locks while waiting for the loop's. No callback here ever takes the
-// engine lock.
+// Alarms and state events are sent by the engine's timer and receive threads, which may not touch the
+// daemon's working session; therefore they have a session of their own. The alarm thread only runs that
+// session's loop: it reads acknowledgements, writes what a full socket has left over, and notices a lost
+// connection. Senders call the session directly, with the engine lock held, and take the locks of this
+// client's own GCL instance. If a send needs a change of the loop's interest in a descriptor, the change is
+// posted to the loop and made by the alarm thread, so that no sender waits for the loop's lock. No callback
+// here takes the engine lock.
 //
-// The start waits for the alarm thread, which waits for mgmtd. The main thread keeps reacting meanwhile: it
-// waits in rounds of its own loop, and the alarm thread's last step of the start wakes it. An exit that
-// begins in such a round ends both waits, the opening by `qv_exiting`. The alarm thread creates its loop
-// under a mutex and checks `qv_exiting` there, so that whoever ends it either finds the loop or is seen.
-// Senders get the session once it is open; what they have to say before that fails.
+// Start. The main thread waits for the alarm thread, which waits for mgmtd. The main thread runs its own loop
+// meanwhile, and the alarm thread's last step wakes it. An exit that begins in the meantime ends both waits;
+// that of the alarm thread ends because of `qv_exiting`. The alarm thread creates its loop with loop_mutex
+// held and checks `qv_exiting` there, so that an exit either finds the loop and can end it, or prevents it.
+// Senders get the session only when it is open; earlier messages fail.
 //
-// qv_initiate_exit comes from the main thread at exit, and from the alarm thread itself when the session is
-// lost; the thread does not join itself. A lost alarm session ends this client only: the daemon ends through
-// its working session, which goes with the same peer.
+// End. qv_initiate_exit is called by the main thread at exit, and by the alarm thread when the session is
+// lost; the thread does not join itself. A lost alarm session ends only this client. The daemon as a whole
+// ends when its working session with the same peer is lost.
 #include "engine/wccp_alarm_client.h"
 
 #include <cerrno>
@@ -34,7 +34,7 @@
 namespace {
 
 lew *qv_alm_lwc;
-gcl_session *alarm_session; // while it opens the alarm thread's alone
+gcl_session *alarm_session; // senders use qv_alm_mgmt_session, which is set once it is open
 mdc *qv_alm_mcc;
 std::atomic<int32_t> qv_exiting;
 gcl *qv_alm_instance;
@@ -58,7 +58,7 @@ mgmt_client qv_alm_client = {&qv_alm_lwc,
 pthread_t alarm_thread;
 std::atomic<bool> alarm_thread_runs; // the thread handle is set
 sem_t start_semaphore;
-bool start_semaphore_exists; // changes while no alarm thread runs, or none that will look at it again
+bool start_semaphore_exists; // changes only before the thread is created and after it has posted or ended
 pthread_mutex_t loop_mutex = PTHREAD_MUTEX_INITIALIZER; // guards qv_alm_lwc until the thread has ended
 
 lc_status qv_alm_mgmt_handle_response(gcl_session *, bn_response_msg *response, void *) {
@@ -98,7 +98,7 @@ lew *get_alarm_loop() {
 
 lc_status create_alarm_loop() {
     const mutex_guard guard(&loop_mutex);
-    if (qv_exiting)
+    if (qv_exiting) // the exit has found no loop to end
         return LC_CANCELLED;
     CHECK_STATUS(lew_init(&qv_alm_lwc));
     return LC_OK;
@@ -119,11 +119,11 @@ lc_status start_alarm_session(const char *client_name) {
                                                            nullptr));
     CHECK_STATUS(qv_alm_mgmt_open_session(client_name));
     const mutex_guard guard(&qv_alm_session_mutex);
-    qv_alm_mgmt_session = alarm_session;
+    qv_alm_mgmt_session = alarm_session; // senders may use it from now on
     return LC_OK;
 }
 
-// Wakes the main thread, which may be waiting in its loop; the posted work itself does nothing.
+// Ends the wait of the main thread. It may be waiting in its loop, so work is posted that does nothing.
 void report_start() {
     static loop_post wake = {nullptr, nullptr, [](loop_post *, int) {}};
     loop_context *main_loop = nullptr;
@@ -147,7 +147,8 @@ void *qv_alm_thread(void *client_name) {
     return nullptr;
 }
 
-// Signals are the main thread's, and locked memory is dear.
+// With all signals blocked, which are for the main thread, and with a small stack, since all memory is
+// locked.
 int create_alarm_thread(const char *client_name) {
     pthread_attr_t attributes;
     pthread_attr_init(&attributes);
@@ -162,13 +163,14 @@ int create_alarm_thread(const char *client_name) {
     return result;
 }
 
-// Until the alarm thread has posted, or an exit has begun, which ends that thread or waits for nobody.
+// Waits until the alarm thread has posted or an exit has begun. Without a loop to run, waits for the post
+// only.
 void wait_for_start() {
     int no_events = 0;
     bool has_loop = wccpd_lwc != nullptr;
     while ((has_loop ? sem_trywait(&start_semaphore) : sem_wait(&start_semaphore)) != 0) {
         if (!has_loop)
-            continue; // a signal
+            continue; // interrupted by a signal
         if (wccpd_shutdown_in_progress())
             return;
         has_loop = lew_dispatch_once(wccpd_lwc, &no_events, nullptr) == LC_OK && !no_events;
@@ -198,7 +200,7 @@ lc_status qv_alm_mgmt_shutdown() {
     LC_LOG(LC_LOG_INFO, "qv_alm_mgmt_shutdown: cancel alm thread");
     if (lew *loop = get_alarm_loop())
         CHECK_STATUS(lew_escape_from_dispatch(loop));
-    if (alarm_thread_runs && !pthread_equal(alarm_thread, pthread_self())) {
+    if (alarm_thread_runs && !pthread_equal(alarm_thread, pthread_self())) { // it cannot join itself
         const int result = pthread_join(alarm_thread, nullptr);
         if (result != 0 && result != ESRCH) {
             LC_LOG(LC_LOG_ERR, "qv_alm_mgmt_shutdown: failed to join thread : %s ", strerror(result));
@@ -220,7 +222,7 @@ lc_status qv_initiate_exit() {
     return LC_OK;
 }
 
-// The engine's threads still run; a sender among them finds the session whole or gone.
+// The engine's threads are still running. A sender finds either a complete session or none.
 lc_status qv_alm_mgmt_deinit() {
     const mutex_guard guard(&qv_alm_session_mutex);
     qv_alm_mgmt_session = nullptr;

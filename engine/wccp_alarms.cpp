@@ -1,14 +1,14 @@
-// Alarms of a service group: the adjacency alarm, for routers that aren't fully connected, and the assignment
-// alarm, for a table that the routers don't carry out as it was meant.
+// Alarms of a service group: the adjacency alarm, for routers that are not two-way connected, and the
+// assignment alarm, for routers that do not carry out the assignment.
 //
-// A bit in raised_alarms shows that an alarm is active. Each alarm has a check on a one-shot timer: it runs
-// 60 seconds after the first reason to check, and later reasons don't delay it unless they ask for that.
-// Nothing starts the timer again once the check has run, so a quiet group keeps its alarms as they are. A
+// A bit in raised_alarms shows that an alarm is active. Each alarm has a check on a one-shot timer, which
+// runs 60 seconds after the first reason to check; later reasons do not delay it unless they ask to. Nothing
+// starts the timer again after the check, so alarms of a group in which nothing happens stay as they are. A
 // router that is removed, or that stops listing this appliance, raises the adjacency alarm at once.
 //
-// The callers hold the engine lock, on the timer thread, a receive thread or the main thread; it guards the
-// bits, the timers and the text of the message. Messages go straight out on the alarm session and nothing
-// waits for an answer. One that can't go is lost: the bit changes all the same, and there is no resend.
+// Callers hold the engine lock, on the timer thread, a receive thread or the main thread. It guards the bits,
+// the timers and the buffers below. Messages are sent directly on the alarm session, and nothing waits for an
+// answer. A message that cannot be sent is lost: the bit changes nevertheless, and nothing is repeated.
 #include "engine/wccp_alarms.h"
 
 #include <cstdio>
@@ -27,12 +27,12 @@ namespace {
 
 constexpr uint32_t CHECK_DELAY = 60; // seconds
 
-// Arming.
+// --- Scheduling the checks
 
 uint32_t arm_check_timer(wccp_timer *timer, int restart) {
     uint32_t length = CHECK_DELAY;
     if (!restart && timer->active == 1 && timer->countdown != 0)
-        length = timer->countdown;
+        length = timer->countdown; // keeps the time of the scheduled check
     *timer = {.active = 1, .mode = WCCP_TIMER_COUNTS, .remaining = 1, .period = length, .countdown = length};
     return length;
 }
@@ -53,9 +53,9 @@ void wccp_alarm_schedule_verify_allocation_table_timer(wccp_service_group *group
            static_cast<int>(length));
 }
 
-// Raising and clearing.
-
 namespace {
+
+// --- Raising and clearing
 
 struct alarm_kind {
     uint16_t bit; // of raised_alarms
@@ -77,20 +77,19 @@ const alarm_kind *find_alarm_kind(uint16_t bit) {
     return nullptr;
 }
 
-// The two texts of a message in the making; engine lock.
+// Two texts of the message that is being built. Guarded by the engine lock.
 char alarm_param_3[64];
 char alarm_comment[64];
 
-// One binding of an event.
+// A binding of an event.
 struct event_field {
     const char *name;
     uint32_t type;
     const char *text;
 };
 
-// An event with its fields, on the alarm session; nothing waits for an answer. The engine's threads may
-// outlive the session at exit, so it is looked at under the lock that its end takes as well, and cancellation
-// is off meanwhile.
+// Sends an event on the alarm session without waiting for an answer. LC_NULL without a session: at exit it is
+// freed before the engine's threads have ended.
 template <size_t Count>
 lc_status send_event(const char *event, const event_field (&fields)[Count]) {
     const mutex_guard guard(&qv_alm_session_mutex);
@@ -125,7 +124,7 @@ void send_alarm(wccp_service_group *group, const alarm_kind *kind, const char *e
 void wccp_alarm_raise_alarm(wccp_service_group *group, uint16_t bit) {
     if (const alarm_kind *kind = find_alarm_kind(bit))
         send_alarm(group, kind, EVENT_RAISE_ALARM, kind->raised);
-    group->raised_alarms |= bit;
+    group->raised_alarms |= bit; // whether or not the message could be sent
 }
 
 void wccp_alarm_clear_alarm(wccp_service_group *group, uint16_t bit) {
@@ -162,7 +161,8 @@ void wccp_alarms_clear_all() {
             wccp_alarms_clear_all_raised_alarms(group);
 }
 
-// A change of role, as the closed library hands it on: it goes the way of the alarms.
+// Called by the platform's library, which finds it by name, to transmit a state event. `one` is the first
+// argument of qv_state_event_send.
 int qv_state_event_transport(uint32_t one, const char *group_id, uint32_t role, const uint8_t *code,
                              gcl_session *) {
     char kind_text[12], role_text[12], code_text[12];
@@ -178,7 +178,7 @@ int qv_state_event_transport(uint32_t one, const char *group_id, uint32_t role, 
     return send_event(EVENT_ROLE_CHANGE, fields) == LC_OK ? 0 : 1;
 }
 
-// The checks.
+// --- The checks
 
 int wccp_alarm_verify_router_connectivity(wccp_service_group *group) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: verify router connectivity.", group->id);
@@ -187,6 +187,7 @@ int wccp_alarm_verify_router_connectivity(wccp_service_group *group) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: alarm: get router connnection stats failed.", group->id);
         return 1;
     }
+    // How many routers answer a multicast address is not known.
     const uint32_t expected = group->mcast_configured == 1 ? 1 : group->ucast_router_count;
     const bool healthy = one_way == 0 && two_way >= expected;
     const bool raised = alarm_is_active(group, WCCP_ALARM_ADJACENCY);
@@ -214,10 +215,11 @@ int wccp_alarm_verify_router_connectivity(wccp_service_group *group) {
 namespace {
 
 bool lacks_its_share(const wccp_rtr_view_appliance *entry) {
-    return entry->buckets_assigned == 0 && entry->weight != 0;
+    return entry->buckets_assigned == 0 && entry->weight != 0; // weight 0 asks for nothing
 }
 
-// What a router gives to an appliance, or to any, and what it should give at least.
+// Notes how much a router assigns to an appliance, or with 0.0.0.0 to all of them, and what was expected.
+// `wanted` 1 stands for any amount.
 void note_assignment_difference(wccp_service_group *group, const wccp_sending_router *router, be32 appliance,
                                 uint32_t has, uint32_t wanted) {
     const wccp_addr_text who = addr_text(appliance);
@@ -226,14 +228,14 @@ void note_assignment_difference(wccp_service_group *group, const wccp_sending_ro
                      wanted == 1 ? wccp_reason_value("some") : wccp_reason_value("%u", wanted));
 }
 
-// What the designated appliance asked for, against what each router reports.
+// For the designated appliance: compares its table with what each router reports.
 bool routers_use_our_table(wccp_service_group *group) {
     for (uint32_t i = 0; i < WCCP_MAX_APPLIANCES; i++) {
         const wccp_dsg_appliance *asked = &group->dsg_appliances[i];
         if (asked->assigned == 0)
             continue;
         for (wccp_sending_router *router = group->sending_routers; router; router = router->next) {
-            uint32_t buckets = 0;
+            uint32_t buckets = 0; // also for a router that does not list the appliance
             wccp_get_router_assignment(group, router, asked->ipa, &buckets);
             QV_LOG(LC_LOG_INFO,
                    "WCCP GRP %d: alarm: verify allocation. appliance %s buckets dsg: %d router %s %d",
@@ -265,7 +267,7 @@ bool routers_use_our_table(wccp_service_group *group) {
     return true;
 }
 
-// Any other appliance looks only for holes.
+// For any other appliance: whether each router redirects to every appliance that has a weight.
 bool routers_redirect_without_holes(wccp_service_group *group) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: alarm: verify by non-designator.", group->id);
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next) {
@@ -281,7 +283,7 @@ bool routers_redirect_without_holes(wccp_service_group *group) {
             note_assignment_difference(group, router, entry->ipa, 0, 1);
             return false;
         }
-        if (!redirects) {
+        if (!redirects) { // also a router that lists no appliances
             QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: alarm: router %s is not redirecting to ANY appliance.",
                    group->id, addr_text(router->router_id).s);
             note_assignment_difference(group, router, {}, 0, 1);
@@ -298,7 +300,7 @@ int wccp_alarms_verify_allocation_table(wccp_service_group *group) {
     const bool in_order =
         group->designated == 1 ? routers_use_our_table(group) : routers_redirect_without_holes(group);
     const bool raised = alarm_is_active(group, WCCP_ALARM_ASSIGNMENT);
-    wccp_forget_older_reasons(group, WCCP_REASON_ASSIGNMENT_DIFFERS);
+    wccp_forget_older_reasons(group, WCCP_REASON_ASSIGNMENT_DIFFERS); // what this check has noted stays
     if (in_order && raised)
         wccp_alarm_clear_alarm(group, WCCP_ALARM_ASSIGNMENT);
     else if (!in_order && !raised)

@@ -1,24 +1,25 @@
 // The designated appliance's table.
 //
-// The state machine collects the appliances that all routers report (start, add for each, finish), and finish
-// turns their weights into a table of slots, each naming one appliance: 256 hash buckets, or the values of
-// the mask. The table is a proportional split over the appliances in sorted order, so each has one run of
-// slots. The order is that of the C library's qsort over the address words as they lie in memory, compared by
-// their difference with wrap-around. Where that comparison runs in circles (three appliances more than half
-// the range apart) the order is whatever qsort makes of it, always the same for the same input.
+// wccp_state.cpp collects the appliances that all routers report (start, add for each, finish). finish turns
+// their weights into a table of slots, each of which names one appliance: 256 hash buckets, or the values of
+// the mask. The slots are split in proportion to the weights over the appliances in sorted order, so that
+// each has one run of slots. The order is that of the C library's qsort with a comparison that takes
+// addresses as 32-bit words in memory order and returns their difference, which can wrap around. When it
+// does, the comparison is not transitive and the order depends on the library; it is the same whenever the
+// input is the same.
 //
-// An appliance that has just dropped out, a down entry, keeps the place of its share for one computation:
-// only its run is split among the others, and no other slot moves. It leaves dsg_appliances right after, so
-// the next computation knows nothing of it. Between computations the entries are the active appliances in
-// order of their first arrival; bucket_index points into this order.
+// An appliance that has just left is a down entry. For one computation it keeps its place, and only its run
+// is split among the others, so that no other slot moves. It is removed right after, and the next computation
+// splits everything over the rest. Between computations dsg_appliances has the active appliances in the order
+// of their first arrival; bucket_index refers to this order.
 //
-// All of it runs under the engine lock, on the tick or on a receive thread. The only memory taken is the work
-// arrays of a computation. Nothing here depends on a clock or on chance: the seed is always 0.
+// dsg_appliances has 32 entries. A report that replaces many appliances at once can need more, because down
+// entries are still in it. Down entries are then dropped, first the one with the fewest slots; slots of
+// others may move in this case. An appliance is added only if every router reports it, and a router reports
+// at most 32, so the active ones always fit.
 //
-// dsg_appliances has 32 places, and a report that replaces many appliances at once may ask for more, since
-// down entries are still in it. Then down entries give way, the one with the fewest slots first; its slots
-// are shared out like any others and its neighbours' may move. At most 32 appliances are reported by all
-// routers, so the active ones always find room.
+// Everything runs with the engine lock held, in a tick or on a receive thread. The only memory allocated are
+// the work arrays of a computation. Nothing depends on a clock or on random numbers: the seed is always 0.
 #include "engine/wccp_assignment.h"
 
 #include <cassert>
@@ -41,12 +42,12 @@ constexpr uint16_t FALLBACK_WEIGHT = 100;
 void wccp_designated_appliance_assignment_start(wccp_service_group *group) {
     group->bucket_count = 0;
     for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
-        group->dsg_appliances[i].up = 0;
+        group->dsg_appliances[i].up = 0; // until it is added again
 }
 
 namespace {
 
-// Takes the down entry with the fewest slots out, the later one of equals. False when no entry is down.
+// Removes the down entry with the fewest slots, the last one of several. False when no entry is down.
 bool drop_smallest_down_entry(wccp_service_group *group) {
     wccp_dsg_appliance *const entries = group->dsg_appliances;
     uint32_t least = WCCP_MAX_APPLIANCES;
@@ -85,7 +86,7 @@ void wccp_designated_appliance_assignment_add(wccp_service_group *group,
 
 namespace {
 
-// The number of slots that the agreed method has, 0 when none is agreed.
+// The number of slots for the agreed method, 0 when none has been agreed. For mask, computes the values.
 uint32_t count_slots_of_method(wccp_service_group *group) {
     switch (group->assign_method) {
     case WCCP_ASSIGN_HASH:
@@ -115,13 +116,14 @@ void compute_group_table(wccp_service_group *group) {
             static_cast<int>(group->dsg_active_count));
         return;
     }
+    // From here on the table counts as computed, even if there is no memory for it.
     group->bucket_count = count_slots_of_method(group);
     if (group->bucket_count != 0)
         wccp_compute_assignment_table(group->dsg_appliance_count, entries, group->bucket_count,
                                       group->bucket_ipa, 0);
 }
 
-// Moves the active entries forward, in their order, and zeroes the places after them.
+// Keeps the active entries, in their order, and returns their number.
 uint32_t remove_down_entries(wccp_service_group *group) {
     uint32_t kept = 0;
     for (uint32_t i = 0; i < group->dsg_appliance_count; i++)
@@ -137,7 +139,7 @@ uint32_t remove_down_entries(wccp_service_group *group) {
 void wccp_designated_appliance_assignment_finish(wccp_service_group *group) {
     group->bucket_count = 0;
     group->dsg_active_count = 0;
-    compute_group_table(group);
+    compute_group_table(group); // with the down entries, which are removed only then
     const uint32_t kept = remove_down_entries(group);
     if (kept == 0) {
         wccp_designated_appliance_assignment_cleanup(group);
@@ -161,7 +163,7 @@ void wccp_designated_appliance_assignment_cleanup(wccp_service_group *group) {
     group->dsg_active_count = 0;
 }
 
-// The computation.
+// --- The computation
 
 namespace {
 
@@ -187,11 +189,11 @@ int compare_address_words(const void *first, const void *second) {
     be32 a, b;
     memcpy(&a, first, sizeof a);
     memcpy(&b, second, sizeof b);
-    return static_cast<int>(raw_word(a) - raw_word(b));
+    return static_cast<int>(raw_word(a) - raw_word(b)); // may wrap around, see above
 }
 static_assert(offsetof(wccp_dsg_appliance, ipa) == 0);
 
-// The slots that a down entry holds are one run of the table.
+// The slots of an entry. They are consecutive.
 struct slot_run {
     uint32_t begin, length;
 };
@@ -230,16 +232,17 @@ void wccp_compute_assignment_table(uint32_t count, wccp_dsg_appliance *entries, 
         active.pointer[active_count] = entry->ipa;
         active_weights.pointer[active_count++] = entry->weight;
         active_weight += entry->weight;
+        // When all weights are 0, the appliance with the highest address word serves everything.
         if (entry->weight == 0 && raw_word(entry->ipa) > raw_word(fallback))
             fallback = entry->ipa;
     }
     if (active_count == 0)
         return;
-    if (active_weight == 0) {
+    if (active_weight == 0) { // nothing to split by
         compute_u8_assignment_array(1, &fallback, &FALLBACK_WEIGHT, slots, table);
     } else {
         compute_u8_assignment_array(count, all.pointer, all_weights.pointer, slots, table);
-        for (uint32_t i = 0; i < count; i++) {
+        for (uint32_t i = 0; i < count; i++) { // only the runs of down entries are split again
             if (entries[i].up)
                 continue;
             const slot_run run = find_slot_run(table, slots, entries[i].ipa);
@@ -268,7 +271,7 @@ void compute_u8_assignment_array(uint32_t count, const be32 *identifiers, const 
     const uint32_t num_buckets = slots;
     uint32_t running = 0, k = 0;
     for (uint32_t i = 0; i < count; i++) {
-        running += weights[i] * slots;
+        running += weights[i] * slots; // rounding each quotient down passes the remainder on to later entries
         const uint32_t quotient = running / total_weight;
         shares.pointer[i] = quotient - k;
         k = quotient;

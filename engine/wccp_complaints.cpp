@@ -1,12 +1,14 @@
+// A token bucket for each interface: BURST tokens, refilled at LINES_PER_SECOND of wccp_g.seconds.
 #include "engine/wccp_complaints.h"
 
 namespace {
 
 constexpr uint32_t BURST = 200;
 constexpr uint32_t LINES_PER_SECOND = 20;
-constexpr uint32_t REPORT_PERIOD = 60; // seconds of a flood without a word of what it suppresses
+constexpr uint32_t REPORT_PERIOD =
+    60; // seconds; how often the number of suppressed lines is logged in a flood
 
-wccp_interface *current_interface; // engine lock
+wccp_interface *current_interface; // of the current scope, null outside one
 
 } // namespace
 
@@ -20,7 +22,7 @@ wccp_complaint_scope::~wccp_complaint_scope() {
 
 namespace {
 
-// One line, if the budget has it.
+// Takes one line from the budget; false when it is used up.
 bool take_from_budget(wccp_complaint_budget *budget) {
     const uint64_t refill = uint64_t{LINES_PER_SECOND} * (wccp_g.seconds - budget->refill_time);
     budget->refill_time = wccp_g.seconds;
@@ -51,7 +53,7 @@ void wccp_report_suppressed_complaints() {
         budget->suppressed_at_tick = budget->suppressed;
         if (budget->suppressed == 0 || (goes_on && wccp_g.seconds - budget->suppressed_since < REPORT_PERIOD))
             continue;
-        (void)take_from_budget(budget); // a tick refills it
+        (void)take_from_budget(budget); // this line is always logged, but counts
         QV_LOG(LC_LOG_ERR, "WCCP: %s: %u more lines about received packets were suppressed.",
                wccp_g.interfaces[i].name, budget->suppressed);
         budget->suppressed = budget->suppressed_at_tick = 0;

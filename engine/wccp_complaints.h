@@ -1,20 +1,21 @@
-// The bound on what received packets can make this appliance write to its log. Engine lock held throughout,
-// but for the exit, once no receive thread is left.
+// Limits how much received packets can make this appliance write to its log.
 //
 // A complaint is a line at notice level or above that any number of packets can cause: what is wrong with a
 // packet or with what it reports, and what failed while it was processed, such as a new router's tunnel.
-// Anybody can send packets, so complaints are counted for the interface that the packet arrived on: a burst
-// of 200 lines passes, then 20 a second. What is beyond that is suppressed, and the number of suppressed
-// lines is logged when the flood is over, or after a minute of it.
+// Anybody can send packets, so complaints are counted for the interface that the packet arrived on: after a
+// burst of 200 lines, 20 lines a second pass. The rest is suppressed, and the number of suppressed lines is
+// logged when the flood is over, or every minute while it lasts.
 //
-// A function logs its complaints with WCCP_COMPLAIN and need not know the interface: a scope on the receive
-// thread says which one it is. Without a scope, as on the tick, nothing is suppressed.
+// Functions log complaints with WCCP_COMPLAIN and need not know the interface: the receive thread opens a
+// scope for it. Outside a scope, for example in a tick, nothing is suppressed.
+//
+// Lock held for everything here, except during the exit once no receive thread is left.
 #pragma once
 
 #include "engine/wccp_records.h"
 #include "runtime/logging.h"
 
-// While it lives, complaints count for the interface. Scopes do not nest.
+// While an object of this type exists, complaints are counted for the interface. Scopes do not nest.
 struct wccp_complaint_scope {
     explicit wccp_complaint_scope(wccp_interface *interface);
     ~wccp_complaint_scope();
@@ -22,12 +23,14 @@ struct wccp_complaint_scope {
     wccp_complaint_scope &operator=(const wccp_complaint_scope &) = delete;
 };
 
-// Whether the next complaint may be logged; it counts as logged or as suppressed from then on.
+// Whether the next complaint may be logged. Counts it as logged or as suppressed.
 bool wccp_may_complain();
 
-// Once a tick: logs how many complaints were suppressed, for each interface whose flood is over.
+// Call it once a tick. For each interface whose flood has ended or lasted for a minute it logs how many
+// complaints were suppressed.
 void wccp_report_suppressed_complaints();
 
+// QV_LOG for complaints.
 #define WCCP_COMPLAIN(level, ...)                                                                            \
     do {                                                                                                     \
         if (lc_log_check_level(level) && wccp_may_complain())                                                \

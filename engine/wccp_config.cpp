@@ -1,21 +1,18 @@
 // Service groups as configuration sees them: added, deleted, enabled, modified, started and stopped.
 //
-// Records: the wccp_service_group that hangs from wccp_g.groups, wccp_g.group_list and its interface's list.
-// Only the main thread adds and deletes groups, so a new record is built outside the engine lock and linked
-// under it. The notifier's thread starts and stops groups too (wccp_link_mgr.cpp), and a tick starts those
-// that waited for sockets, both with the lock held by the caller. The main thread and the notifier are never
-// cancelled; the timer thread is cancelled outside a tick, or once there are no groups. A group is therefore
-// never left half started or half stopped.
+// The record of a group is linked from wccp_g.groups, wccp_g.group_list and its interface's list. Only the
+// main thread adds and deletes groups, so a new record is filled without the engine lock and linked with it.
+// Groups are also started and stopped by the notifier thread (wccp_link_mgr.cpp), and started by a tick when
+// their sockets have been recovered; the caller then holds the lock. Nothing keeps a pointer into a
+// wccp_grp_config.
 //
-// Nothing here keeps a pointer into the caller's wccp_grp_config.
+// Shutdown message. A group whose routers have learned of it sends a last Here-I-Am with the shutdown
+// command. It is sent while addresses, sockets and methods are still those that the routers know. A group in
+// INIT has nothing to withdraw and sends none, which makes it safe to stop a group twice.
 //
-// The shutdown message. A group that routers know sends one last Here-I-Am, which carries the shutdown
-// command. It is sent under the lock while addresses, sockets and methods are still those that the routers
-// know. A group in INIT has nothing to withdraw and sends none, which makes a stop safe to repeat.
-//
-// A multicast group that cannot join, on an interface without an address above all, is reported as a failure
-// although it stays in the tables. The first address opens the sockets, joins, and starts it; after another
-// failure, the first retry of the set-up that succeeds does.
+// A multicast group that cannot join its address, for example on an interface that has no address yet, is
+// reported as a failure but stays in the tables. It starts when the interface gets its address or when a
+// retry of the socket set-up succeeds.
 
 #include "engine/wccp_config.h"
 
@@ -45,7 +42,7 @@ constexpr uint32_t MONITOR_SECONDS = 5;
 constexpr uint32_t NETWORK_RETRY_SECONDS = 30;
 constexpr uint8_t MCAST_TTL_FOR_ZERO = 33;
 
-// Which update sets which bit of service_flags.
+// The bit of service_flags for each hash field.
 struct hash_row {
     uint32_t config_flag;
     uint32_t service_flag;
@@ -93,7 +90,7 @@ void set_password(wccp_service_group *group, const wccp_grp_config *config) {
 void set_routers(wccp_service_group *group, const wccp_grp_config *config) {
     for (uint32_t i = 0; i < config->router_count && i < WCCP_MAX_ROUTERS; i++) {
         const be32 address = config->routers[i];
-        if ((address.bytes[0] & 0xf0) == 0xe0) {
+        if ((address.bytes[0] & 0xf0) == 0xe0) { // 224.0.0.0/4: the first one ends the list
             group->mcast_ipa = address;
             group->mcast_configured = 1;
             return;
@@ -107,7 +104,7 @@ void start_timer(wccp_timer *timer, uint32_t period, uint32_t countdown) {
         .active = 1, .mode = WCCP_TIMER_REPEATS, .remaining = 0, .period = period, .countdown = countdown};
 }
 
-// What a group has agreed with its routers and computed for them.
+// Clears what the group has agreed with its routers and computed for them.
 void clear_agreement(wccp_service_group *group) {
     group->designated = 0;
     group->fwd_method = WCCP_METHOD_NONE;
@@ -133,7 +130,7 @@ void free_group(wccp_service_group *group) {
     wccp_free(group);
 }
 
-// For configuration, which may add hundreds of groups in one second: one attempt is enough then.
+// Configuration may add hundreds of groups to an interface in one second; one attempt is enough for all.
 void recover_once_per_second(wccp_interface *interface) {
     if (interface->network_tried != wccp_g.seconds)
         wccp_recover_interface(interface);
@@ -162,7 +159,7 @@ wccp_interface *find_or_add_interface(const wccp_grp_config *config) {
     return interface;
 }
 
-// All of a new group but what belongs to its interface, whose address may change while there is no lock.
+// A new group except for its appliance address: without the lock the interface's address may still change.
 wccp_service_group *build_group(const wccp_grp_config *config) {
     auto *group = static_cast<wccp_service_group *>(wccp_malloc(sizeof(wccp_service_group)));
     if (!group) {
@@ -207,7 +204,7 @@ int wccp_add_group(const wccp_grp_config *config) {
     wccp_interface *interface = find_or_add_interface(config);
     if (!interface)
         return 1;
-    if (wccp_find_group(config->group_id)) {
+    if (wccp_find_group(config->group_id)) { // without the lock: only this thread adds and deletes groups
         QV_LOG(LC_LOG_ERR, "WCCP:wccp_add_group: Group %d already exists", config->group_id);
         return 1;
     }
@@ -216,7 +213,7 @@ int wccp_add_group(const wccp_grp_config *config) {
         return 1;
 
     const wccp_engine_lock lock;
-    group->appliance_ipa = interface->ipa;
+    group->appliance_ipa = interface->ipa; // from now on the link manager keeps it up to date
     wccp_g.groups[group->id] = group;
     list_push_head(&wccp_g.group_list, group);
     wccp_g.group_count++;
@@ -233,7 +230,7 @@ int wccp_add_group(const wccp_grp_config *config) {
 
 void wccp_start_service_group(wccp_service_group *group) {
     group->assign_timer.active = 0;
-    wccp_flush_group_lists(group);
+    wccp_flush_group_lists(group); // a group that is running already starts afresh
     clear_agreement(group);
     wccp_forget_all_reasons(group);
     group->start_time = wccp_g.seconds;
@@ -248,7 +245,7 @@ void wccp_start_service_group(wccp_service_group *group) {
         QV_LOG(LC_LOG_NOTICE, "WCCP GRP %d: not launched (links are not ready)", group->id);
         return;
     }
-    start_timer(&group->hia_timer, HERE_I_AM_SECONDS, 1);
+    start_timer(&group->hia_timer, HERE_I_AM_SECONDS, 1); // the first Here-I-Am is sent in the next tick
     start_timer(&group->monitor_timer, MONITOR_SECONDS, MONITOR_SECONDS);
     if (wccp_set_L2_return(group->id, group->force_l2_return) != 0 && group->force_l2_return)
         wccp_note_reason(group, WCCP_REASON_TUNNELD_SILENT, {}, {}, wccp_reason_value("return by L2"));
@@ -257,7 +254,7 @@ void wccp_start_service_group(wccp_service_group *group) {
 int wccp_notify_service_group_shutdown(wccp_service_group *group) {
     if (group->state_flags & WCCP_STATE_INIT)
         return 0;
-    group->state_flags |= WCCP_SHUTTING_DOWN;
+    group->state_flags |= WCCP_SHUTTING_DOWN; // adds the shutdown command to the message
     const int result = wccp_transmit_packet(group, group->tx_pkt, WCCP_HERE_I_AM);
     group->state_flags &= ~WCCP_SHUTTING_DOWN;
     if (result != 0)
@@ -273,7 +270,7 @@ void wccp_stop_service_group(wccp_service_group *group) {
     wccp_flush_group_lists(group);
     clear_agreement(group);
     wccp_forget_all_reasons(group);
-    wccp_note_network(group);
+    wccp_note_network(group); // the interface may be the cause of the stop
     group->start_time = wccp_g.seconds;
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 1);
     wccp_appliance_state_init(group);
@@ -294,11 +291,11 @@ int wccp_flush_group_lists(wccp_service_group *group) {
 
 namespace {
 
-// Takes the group out of the engine and frees it. Lock held.
+// Removes the group from the engine and frees it. Lock held.
 void remove_group(wccp_service_group *group, bool clear_alarms) {
     list_unlink(group);
     wccp_g.groups[group->id] = nullptr;
-    wccp_notify_service_group_shutdown(group);
+    wccp_notify_service_group_shutdown(group); // while it still has its interface and views
     wccp_if_remove_group(group);
     wccp_flush_group_lists(group);
     wccp_set_role_and_send_event(group->id, WCCP_ROLE_UNKNOWN);
@@ -329,14 +326,14 @@ int wccp_del_all_groups() {
     return 0;
 }
 
-// Changes of one field.
-
 namespace {
+
+// --- Changes of one field
 
 int wccp_enable_group(wccp_service_group *group, const wccp_grp_config *) {
     if (group->admin_state == WCCP_ADMIN_UP)
         return 0;
-    if (group->interfaces[0])
+    if (group->interfaces[0]) // before it is enabled, so that it is started only once
         recover_once_per_second(group->interfaces[0]);
     group->admin_state = WCCP_ADMIN_UP;
     wccp_start_service_group(group);
@@ -401,7 +398,7 @@ int wccp_set_compatibility_mode(wccp_service_group *group, const wccp_grp_config
     return 0;
 }
 
-// What an update does, in the order in which its flags are looked at.
+// The action for each flag, in the order in which the flags are tested.
 struct modify_row {
     uint32_t config_flags;
     bool (*applies)(const wccp_grp_config *config); // null: always

@@ -1,9 +1,9 @@
-// The engine's face towards configuration: groups are added, deleted, modified, started and stopped here.
+// The engine's interface to configuration: adds, deletes, modifies, starts and stops groups.
 #pragma once
 
 #include "engine/wccp_records.h"
 
-// Which field an update carries. One bit at a time; the first match in the order of wccp_modify_grp acts.
+// Which field a modification changes: one bit, in config_flags. Of several, wccp_modify_grp acts on one.
 enum : uint32_t {
     WCCP_CFG_ROUTERS = 0x0001,
     WCCP_CFG_ADMIN = 0x0002,
@@ -23,24 +23,41 @@ enum : uint32_t {
     WCCP_CFG_MASK_DST_PORT = 0x8000,
 };
 
-// These take the lock themselves.
+// Main thread; these take the engine lock. 0, or 1 with a line in the log.
+
+// Adds a group and starts it if it is enabled and its interface is ready. Adds the interface if necessary.
+// When the multicast address cannot be joined the result is 1, but the group has been added and starts later.
 int wccp_add_group(const wccp_grp_config *config);
 int wccp_del_group(int id);
-int wccp_del_all_groups();
+int wccp_del_all_groups(); // at exit; clears no alarms; always 0
+// Changes the one field that config_flags names, without restarting the group. Also 0 when it names none, and
+// when a group that does not exist is enabled or disabled.
 int wccp_modify_grp(const wccp_grp_config *config);
+// Sets the TTL of multicast transmissions to the low 8 bits of `ttl`; 0 means 33. Also 1 when a socket
+// refuses.
 int wccp_set_mcast_ttl(uint32_t ttl);
 
-// Lock held.
+// Lock held. Starting and stopping may wait for tunneld.
+
+// Starts the group afresh, in INIT. If it is disabled or its interface is not ready, no timers are started.
 void wccp_start_service_group(wccp_service_group *group);
+// Sends the shutdown message, drops everything learned from routers, and enters INIT.
 void wccp_stop_service_group(wccp_service_group *group);
-int wccp_stop_all_service_groups();
+int wccp_stop_all_service_groups(); // all enabled groups; always 0
+// Count the call on the interface, and start or stop its enabled groups. Nothing is started until it is
+// ready.
 void wccp_start_service_groups_by_interface(wccp_interface *interface);
 void wccp_stop_service_groups_by_interface(wccp_interface *interface);
 // Starts the enabled groups of a ready interface that are not running.
 void wccp_start_waiting_groups(wccp_interface *interface);
-// Retries what the socket set-up of the interface could not do. If that succeeds, starts those groups.
+// Repeats the part of the interface's socket set-up that failed and, if it succeeds now, starts those groups.
 void wccp_recover_interface(wccp_interface *interface);
-// Does so for each interface that lacks something an enabled group needs, every 30 seconds.
+// The same for every interface whose set-up failed, that an enabled group needs, and whose last attempt was
+// at least 30 seconds ago. Once a tick.
 void wccp_recover_interfaces_due();
+// Sends a Here-I-Am with the shutdown command, unless the group is in INIT. 0, or the status of the
+// transmission.
 int wccp_notify_service_group_shutdown(wccp_service_group *group);
+// Frees the sending routers, with their tunnel references, both views, and the queued removal replies. Always
+// 0.
 int wccp_flush_group_lists(wccp_service_group *group);

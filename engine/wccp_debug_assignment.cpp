@@ -1,6 +1,6 @@
 // The assignment text of a group: what is configured, what the designated appliance computed, and what each
-// router reports. Lock held. The routers' bucket words are printed as they are stored, the designator's from
-// the table.
+// router reports. Lock held. The routers' bucket words are printed as stored; those of the designated
+// appliance are made from its table.
 #include <cstdio>
 
 #include "engine/wccp_debug_pieces.h"

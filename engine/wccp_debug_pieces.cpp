@@ -1,5 +1,5 @@
-// The two scratch buffers of the dumps, and how a piece gets from there into the display buffer. The engine
-// lock is held throughout; a piece that outgrows its scratch is cut.
+// The two scratch buffers of the dumps. The engine lock is held throughout; a piece that does not fit is
+// truncated.
 #include "engine/wccp_debug_pieces.h"
 
 #include <cstdarg>

@@ -1,24 +1,24 @@
-// How a dump is written: a piece of text is formatted into a scratch buffer, within its bounds, and appended
-// to the display buffer; a row is a label, a writer of its value, and a newline. Lock held: the scratch
-// buffers are shared.
+// The parts of a diagnostic dump. A piece of text is formatted into a scratch buffer, truncated to its size,
+// and then appended to the caller's display buffer. A row is a label, its value and a newline. The scratch
+// buffers are shared by all dumps, so the lock must be held throughout.
 #pragma once
 
 #include "engine/wccp_records.h"
 #include "runtime/csys.h"
 
-// One piece in the making.
+// A piece that is being formatted.
 struct wccp_piece {
-    csys_display_buf *buffer; // where it goes
-    char *text;               // scratch
-    uint32_t size;
+    csys_display_buf *buffer; // that it will be appended to
+    char *text;               // the scratch buffer
+    uint32_t size;            // bytes of the scratch buffer
     uint32_t used;
 };
-wccp_piece wccp_group_piece(csys_display_buf *buffer);      // global and group text
-wccp_piece wccp_assignment_piece(csys_display_buf *buffer); // assignment text
+wccp_piece wccp_group_piece(csys_display_buf *buffer);      // for global and group text
+wccp_piece wccp_assignment_piece(csys_display_buf *buffer); // for assignment text and other long lines
 
 void wccp_piece_add(wccp_piece *piece, const char *format, ...) __attribute__((format(printf, 2, 3)));
-// Appends the piece and empties it: 1 when the display buffer had no room for it, or there was nothing to
-// append.
+// Appends the piece to the display buffer and empties it. 0, or 1 when the display buffer is full or the
+// piece was empty.
 int wccp_piece_flush(wccp_piece *piece);
 
 template <typename Record>
@@ -38,7 +38,7 @@ int wccp_print_rows(wccp_piece *piece, const wccp_dump_row<Record> (&rows)[Count
     return 0;
 }
 
-// Leaves a dump whose buffer is full.
+// Returns 1 from a dump whose display buffer is full.
 #define WCCP_BAIL_ON_ZERO(failed)                                                                            \
     do {                                                                                                     \
         if (failed) {                                                                                        \

@@ -1,11 +1,10 @@
-// Diagnostic dumps: the global counters, the whole state of a group, and its statistics, as text for an
-// operator.
+// Diagnostic dumps: the global counters, the state of a group, and its statistics, as text for an operator.
 //
-// The entry points run on the management thread and hold the engine lock while they read, which stops the
-// tick and packet processing for that time; they allocate nothing. Rows are tables of label and value. Every
-// row is appended on its own, so that no number of routers or appliances can outgrow the scratch buffer; a
-// display buffer that is full ends the dump there, with a newline and the result 1. The assignment text has a
-// file of its own.
+// The public functions run on the main thread and hold the engine lock while they read, which delays the tick
+// and packet processing for that time. They allocate nothing. Rows are tables of label and value, each
+// appended on its own, so that no number of routers or appliances can outgrow the scratch buffer. When the
+// display buffer is full, the dump ends there with a newline and the result 1. The assignment text is in
+// wccp_debug_assignment.cpp.
 #include "engine/wccp_debug_utils.h"
 
 #include <cstdarg>
@@ -41,7 +40,7 @@ void put_swapped_words(wccp_piece *piece, const uint32_t *words) {
 using group_row = wccp_dump_row<wccp_service_group>;
 using router_row = wccp_dump_row<wccp_sending_router>;
 
-// A row whose value is one counter or number of the record.
+// A row whose value is one field of the record.
 #define NUMBER_ROW(record, label, format, field)                                                             \
     {                                                                                                        \
         label, [](wccp_piece *p, const record *r) { wccp_piece_add(p, format, r->field); }                   \
@@ -154,7 +153,7 @@ const group_row configured_rows[] = {
     NUMBER_ROW(wccp_service_group, "WCCP configured interfaces", "%d", if_count),
 };
 
-// One interface of a group, as its three rows take it.
+// An interface of a group, for its three rows.
 struct dump_interface {
     int number;
     const wccp_interface *interface;
@@ -398,7 +397,7 @@ int append_closing_line(csys_display_buf *buffer) {
     return 0;
 }
 
-// What went wrong in a part of an entry point, in the words of that entry point.
+// Logs which part of a dump failed, and returns 1.
 int log_failed_part(const char *words) {
     QV_LOG(wccp_dump_failure_level, "WCCP: %s failed.", words);
     return 1;
@@ -420,7 +419,7 @@ int wccp_print_global(csys_display_buf *buffer) {
 
 namespace {
 
-// One group of the dump of all.
+// A group within the dump of everything.
 int print_one_of_all(wccp_service_group *group, csys_display_buf *buffer) {
     const int id = group->id;
     WCCP_BAIL_ON_ZERO(

@@ -1,8 +1,9 @@
-// Hash assignment: the table of 256 buckets in the form in which it is sent, an index for each bucket, and
-// how many buckets each appliance holds. Runs at the end of a computation, under the engine lock.
+// Hash assignment: derives from the table of 256 buckets the form in which it is sent, an index for each
+// bucket, and the number of buckets of each appliance. Runs at the end of a computation, with the engine lock
+// held.
 //
-// A bucket whose appliance is no active entry keeps its previous index. That happens only when the table
-// could not be computed for lack of memory, and the sum of the counts then shows it.
+// A bucket whose appliance is not an active entry keeps its index. That happens only when there was no memory
+// to compute the table; the sum of the counts then differs from 256, which is logged when the table is sent.
 #include "engine/wccp_hash_assignment.h"
 
 #include "engine/wccp_slot_owners.h"

@@ -1,5 +1,5 @@
-// The table of interfaces, wccp_g.interfaces: slots are taken one by one and never given back, so that a
-// pointer to one is valid as long as the engine is. It grows at start and from wccp_add_group.
+// The table of interfaces, wccp_g.interfaces. Entries are added at start and by wccp_add_group and are never
+// removed, so a pointer to one stays valid.
 
 #include "engine/wccp_interface.h"
 

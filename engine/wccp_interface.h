@@ -1,14 +1,16 @@
-// The table of interfaces, and which groups are on which interface. Engine lock held, or at start.
+// The table of interfaces, and which groups are on which interface. Lock held, or at start before any thread
+// exists.
 #pragma once
 
 #include "engine/wccp_records.h"
 
-// Empties the slots that are not in use yet.
-void wccp_if_init_table();
-wccp_interface *wccp_if_find_interface(const char *name); // null when it is not in the table
-// The new entry, with its sockets open if it has an address; the known one if the name is in the table; null
-// when the table is full.
+void wccp_if_init_table(); // initialises the unused entries
+// Compares at most 16 bytes of the names. Null when the interface is not in the table. Entries never move.
+wccp_interface *wccp_if_find_interface(const char *name);
+// Adds an entry with the address and link state from the kernel, and opens its sockets if it has an address.
+// Returns the existing entry if there is one. Null, with a line in the log, when the table is full.
 wccp_interface *wccp_if_add_interface(const char *name);
-// Membership of a group; 0, or 1 for a null argument or a group on too many interfaces.
+// Puts the group on the interface. 0, or 1 for a null argument or when the group has too many interfaces.
 int wccp_if_add_group(wccp_service_group *group, wccp_interface *interface);
-void wccp_if_remove_group(wccp_service_group *group); // on no interface: nothing
+// Takes the group off its interface's list. Nothing if it is on none.
+void wccp_if_remove_group(wccp_service_group *group);

@@ -1,22 +1,23 @@
-// Reactions to the kernel's link and address notifications. An interface is ready when it has a link and an
+// Reacts to the kernel's link and address notifications. An interface is ready when it has a link and an
 // address; its groups run only then.
 //
-// The two callbacks run on the platform's notifier thread and take the engine lock for all their work. Once
-// an interface is in the table they are the only ones that change its state. They check whether the daemon is
-// exiting before they ask for the lock and again once they have it: a callback that waited while the groups
-// were stopped must neither start them again nor create a receive thread after all threads have been ended.
-// The notifier's thread outlives the engine; what the callbacks touch has no destructor.
+// The two callbacks run on the platform's notifier thread and take the engine lock for all their work. They
+// alone change the state of an interface once it is in the table. Each checks for the exit twice, before it
+// takes the lock and again once it has it: a callback that waited while the groups were deleted must not open
+// sockets or create a receive thread after all threads have been joined. The notifier thread outlives the
+// engine, so whatever the callbacks use has no destructor.
 //
-// Order matters on a change of address. The shutdown messages of the groups need the old sockets and the old
-// address, and their tunnel references are found by the old address; then come the new sockets, the groups'
-// own address, and the start. When the address goes, the ready bit is cleared first, so that no shutdown
-// message is tried.
+// The order of steps matters when an address changes. The shutdown messages of the groups need the old
+// sockets and address, and their tunnel references are found by the old address. New sockets, the groups' new
+// address and their start follow. When the address is removed, the ready bit is cleared first, so that no
+// shutdown message is sent from an address that is gone.
 //
-// An address notification only says that something has changed. The kernel is asked for the present address,
-// so events that come late, twice or out of order have the same outcome. The address alone does not show one
-// thing: while a callback waits for the lock, an interface can be deleted and created again under the same
-// name with the same address. The memberships of its multicast socket went with the old device. The sockets
-// therefore remember the device that they were opened on, and are opened again if it is another one.
+// An address notification only says that something has changed. The present address is read from the kernel,
+// so notifications that are late, duplicate or out of order have the same result. There is one case that the
+// address does not show: while a callback waits for the lock, an interface can be deleted and created again
+// with the same name and address. The multicast memberships of its socket were lost with the old device.
+// Therefore the interface keeps the index of the device that its sockets were opened on, and they are opened
+// again when that has changed.
 
 #include "engine/wccp_link_mgr.h"
 
@@ -36,7 +37,7 @@ int wccp_init_link_mgr() {
         const wccp_engine_lock lock;
         wccp_if_init_table();
     }
-    // Asks mgmtd and runs the event loop meanwhile: no lock here.
+    // No lock here: this asks mgmtd and runs the event loop while it waits.
     wccp_init_primary_wan_interface();
     {
         const wccp_engine_lock lock;
@@ -68,7 +69,7 @@ void wccp_deinit_link_mgr() {
 void wccp_link_update_group_ipa(wccp_service_group *first, be32 ipa) {
     for (wccp_service_group *group = first; group; group = group->if_next) {
         if (group->appliance_ipa != ipa)
-            wccp_flush_group_lists(group); // its tunnel references are found by the old address
+            wccp_flush_group_lists(group); // drops its tunnel references, which need the old address
         group->appliance_ipa = ipa;
     }
 }
@@ -80,7 +81,7 @@ void wccp_process_if_state_change(const void *argument) {
     const wccp_engine_lock lock;
     if (wccpd_shutdown_in_progress() == 1)
         return;
-    char name[sizeof info->name + 1];
+    char name[sizeof info->name + 1]; // the platform's name may lack the terminating NUL
     snprintf(name, sizeof name, "%.*s", static_cast<int>(sizeof info->name), info->name);
     wccp_interface *interface = wccp_if_find_interface(name);
     if (!interface) {
@@ -88,7 +89,7 @@ void wccp_process_if_state_change(const void *argument) {
         return;
     }
     const uint32_t up = info->admin_up && info->link_up ? 1 : 0;
-    if (interface->link_up == up) {
+    if (interface->link_up == up) { // still a chance to repeat a failed set-up
         wccp_recover_interface(interface);
         return;
     }
@@ -108,7 +109,7 @@ void wccp_process_if_state_change(const void *argument) {
 namespace {
 
 void handle_lost_address(wccp_interface *interface) {
-    interface->ready_flags &= ~WCCP_IPA_READY;
+    interface->ready_flags &= ~WCCP_IPA_READY; // first, so that no shutdown message is sent
     wccp_stop_service_groups_by_interface(interface);
     wccp_link_update_group_ipa(interface->groups, interface->ipa);
 }
@@ -122,13 +123,13 @@ void handle_first_address(wccp_interface *interface) {
 
 void handle_changed_address(wccp_interface *interface) {
     interface->ready_flags |= WCCP_IPA_READY;
-    wccp_stop_service_groups_by_interface(interface);
+    wccp_stop_service_groups_by_interface(interface); // sends from the old address
     wccp_init_network_by_interface(interface);
     wccp_link_update_group_ipa(interface->groups, interface->ipa);
     wccp_start_service_groups_by_interface(interface);
 }
 
-// The address is as it was; the device under it, or what the sockets lack, may not be.
+// The device may have been created again, or the socket set-up may be incomplete.
 void handle_same_address(wccp_interface *interface) {
     if (is_zero(interface->ipa))
         return;

@@ -1,13 +1,13 @@
-// Mask assignment: the values that the group's mask spans, and which appliance serves each.
+// Mask assignment: the values of the group's mask, and the appliance that serves each value.
 //
-// A router ANDs fields of a packet with the mask and looks the result up among the values. Each bit that is
-// set in the mask is stored alone, in one fixed order over the fields, and value k is the sum of those bits
-// whose number is set in k. Thus 7 bits give 128 values, and a mask of 0 gives the one value 0. A mask with
-// more bits is not used: four bits of the destination address replace it, in the assignment only. The
-// configured mask stays, and Here-I-Am goes on sending it.
+// A router ANDs fields of a packet with the mask and looks the result up among the values. The bits of the
+// mask are numbered in a fixed order over the fields; value k has those bits set whose number is a set bit of
+// k. Thus 7 bits give 128 values, and a mask of 0 gives the single value 0. A mask of more bits is not used
+// for the assignment: four bits of the destination address replace it. The configured mask remains, and
+// Here-I-Am continues to carry it.
 //
-// Runs inside a computation of the table, under the engine lock: first the values, which then count as slots,
-// and at the end their owners. Masks and values are in host order.
+// Runs during a computation of the table, with the engine lock held: first the values, which are the slots of
+// the table, and at the end their owners. Masks and values are in host order.
 #include "engine/wccp_mask_assignment.h"
 
 #include <cstring>
@@ -30,7 +30,7 @@ void wccp_mask_assignment_set_bit_array_element(wccp_service_group *group, const
 }
 
 void build_bit_array(wccp_service_group *group) {
-    enum { DST_PORT, SRC_PORT, DST_IP, SRC_IP, FIELDS }; // the order in which bits are taken
+    enum { DST_PORT, SRC_PORT, DST_IP, SRC_IP, FIELDS }; // the order in which bits are numbered
     const wccp_mask &mask = group->mask_in_use;
     const uint32_t fields[FIELDS] = {mask.dst_port, mask.src_port, mask.dst_ip, mask.src_ip};
     for (uint32_t field = 0; field < FIELDS; field++) {
@@ -48,7 +48,7 @@ void build_bit_array(wccp_service_group *group) {
     }
 }
 
-// Each value is the one without its lowest bit, plus that bit.
+// Value k is the value of k without its lowest set bit, with the mask bit of that number added.
 void wccp_mask_assignment_generate_values(wccp_service_group *group) {
     const uint32_t count = 1u << group->mask_bit_count;
     group->mask_values[0] = {};

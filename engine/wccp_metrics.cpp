@@ -1,3 +1,4 @@
+// Prints the numbers of a group. Lock held, except in wccp_print_metrics.
 #include "engine/wccp_metrics.h"
 
 #include "engine/wccp_debug_pieces.h"

@@ -1,5 +1,5 @@
-// The numbers of a group for a monitoring system, as one text, so that thousands of routers need no node
-// each. One line for each subject, words separated by blanks; times are in seconds:
+// The numbers of a group for a monitoring system as one text, so that thousands of routers need no nodes of
+// their own. Each line has words separated by blanks; times are in seconds:
 //
 //   group ACTIVE DESIGNATED UPTIME ROUTERS APPLIANCES PENDING_ACKS      the first two are 1 or 0
 //   counter WORD VALUE
@@ -12,8 +12,8 @@
 
 #include "runtime/csys.h"
 
-// Longest text: 17 counters, 32 routers, 32 appliances and 40 reasons.
+// Bytes of the longest text: 17 counters, 32 routers, 32 appliances and 40 reasons.
 constexpr uint32_t WCCP_METRICS_BYTES = 12288;
 
-// Takes the engine lock. 0, or 1 when there is no such group or the text did not fit.
+// Takes the engine lock. 0, or 1 when `buffer` is null, there is no such group, or the text did not fit.
 int wccp_print_metrics(int id, csys_display_buf *buffer);

@@ -1,22 +1,22 @@
-// Set-up of the sockets of an interface, and its receive thread.
+// The sockets of an interface and its receive thread.
 //
 // Each interface owns a unicast socket, bound to its address, and a multicast socket, bound to the first
-// group address that is joined on it. They are opened and closed with the engine lock held, by the main
-// thread and the notifier, neither of which is ever cancelled, and by the timer thread with cancellation off.
+// group address that is joined on it. Both are opened and closed with the engine lock held: by the main
+// thread and the notifier thread when configuration or the kernel changes something, and by the timer thread
+// on a retry.
 //
-// A step can fail for want of descriptors, or because another process has the port. The interface then stays
-// as far as the set-up got, and remembers that something is missing. That is tried again at the next
-// notification for the interface, when configuration adds or enables a group on it, and every 30 seconds
-// while an enabled group needs it.
+// A step of the set-up can fail, because there are no descriptors left or another process has the port. The
+// set-up then ends there and the interface records which part failed (network_flaws). That part is tried
+// again at the next notification for the interface, when configuration adds or enables a group on it, and
+// every 30 seconds while an enabled group needs it.
 //
-// All groups of an interface send Here-I-Am in one tick, with the engine lock held, and their routers answer
-// at once: with 256 groups of 32 routers, some 8000 datagrams wait for the end of that tick. The kernel's
-// default buffer holds a few hundred; the rest would be lost at every tick, and routers would time out. A
-// larger limit costs memory only while datagrams are queued, and that memory is the kernel's.
+// Buffers. All groups of an interface send Here-I-Am in the same tick, with the engine lock held, and their
+// routers answer at once. With 256 groups of 32 routers some 8000 datagrams arrive before the tick releases
+// the lock. The kernel's default buffer holds a few hundred; the rest would be lost in every round, until
+// routers time out. A larger buffer costs memory only while datagrams are queued.
 //
-// A receive thread is created once for an interface and outlives its sockets. `rx_thread` only says that it
-// was created: after the change to bridge mode the thread is gone but the cell stays set, so that no second
-// one is created.
+// A receive thread is created once for an interface and outlives its sockets. `rx_thread` stays set when the
+// thread has been ended by the change to bridge mode, so that no second one is created.
 
 #include "engine/wccp_network.h"
 
@@ -42,8 +42,7 @@
 
 namespace {
 
-constexpr int SOCKET_BUFFER_BYTES =
-    16 << 20; // bytes in each direction, with the kernel's own overhead for each datagram
+constexpr int SOCKET_BUFFER_BYTES = 16 << 20; // each way; the kernel's overhead for a datagram counts too
 
 int bind_socket(int fd, be32 address) {
     const sockaddr_in local = wccp_socket_address(address);
@@ -54,16 +53,17 @@ struct socket_option {
     int level, name;
     const void *value;
     socklen_t length;
-    const char *failure; // with the interface's name
+    const char *failure; // format of the log line, given the interface's name
 };
 
-// As large as the kernel allows.
+// The first option needs CAP_NET_ADMIN; the second is limited by net.core.rmem_max or wmem_max.
 void set_buffer_size(int fd, int forced, int within_limits) {
     if (setsockopt(fd, SOL_SOCKET, forced, &SOCKET_BUFFER_BYTES, sizeof SOCKET_BUFFER_BYTES) != 0)
         (void)setsockopt(fd, SOL_SOCKET, within_limits, &SOCKET_BUFFER_BYTES, sizeof SOCKET_BUFFER_BYTES);
 }
 
-// A datagram socket with these options, or -1; each failure has its log line, and the interface its errno.
+// Returns a non-blocking datagram socket with these options, or -1 with a line in the log and the errno in
+// network_error.
 template <size_t Count>
 int open_datagram_socket(wccp_interface *interface, const char *open_failure,
                          const socket_option (&options)[Count]) {
@@ -88,7 +88,7 @@ int open_datagram_socket(wccp_interface *interface, const char *open_failure,
 }
 
 int open_unicast_socket(wccp_interface *interface) {
-    const int on = 1, no_discovery = IP_PMTUDISC_DONT;
+    const int on = 1, no_discovery = IP_PMTUDISC_DONT; // messages may be fragmented
     const socket_option options[] = {
         {SOL_SOCKET, SO_REUSEADDR, &on, sizeof on, "WCCP: net init %s: Cannot set mcast socket option: %m"},
         {IPPROTO_IP, IP_MTU_DISCOVER, &no_discovery, sizeof no_discovery,
@@ -98,7 +98,7 @@ int open_unicast_socket(wccp_interface *interface) {
         open_datagram_socket(interface, "WCCP: net init %s: Fail to open ucast socket. %m", options);
     if (fd < 0)
         return 1;
-    // A socket that cannot be bound stays open; it is `ucast_bound` that permits sending.
+    // A socket that cannot be bound stays open until the next set-up; only `ucast_bound` permits sending.
     const int result = bind_socket(fd, interface->ipa);
     if (result != 0) {
         interface->network_error = errno;
@@ -126,7 +126,7 @@ int open_multicast_socket(wccp_interface *interface) {
     const int fd = open_datagram_socket(interface, "WCCP: net init %s: Cannot open mc socket. %m", options);
     if (fd < 0)
         return 1;
-    wccp_set_descriptor(&interface->mcast_fd, fd);
+    wccp_set_descriptor(&interface->mcast_fd, fd); // stays open even if the next step fails
     if (setsockopt(fd, IPPROTO_IP, IP_MULTICAST_IF, &interface->ipa, sizeof interface->ipa) != 0) {
         interface->network_error = errno;
         QV_LOG(LC_LOG_ERR, "WCCP: net init %s: Cannot set mcast output interface to: %s. %m", interface->name,
@@ -177,7 +177,7 @@ void *wccp_rx_thread_fn(void *argument) {
             continue;
         pkt.length = static_cast<uint32_t>(received);
         const wccp_engine_lock lock;
-        if (wccpd_shutdown_in_progress() == 1)
+        if (wccpd_shutdown_in_progress() == 1) // the thread ends when it is cancelled
             continue;
         const wccp_complaint_scope complaints(interface);
         wccp_process_received_packet(&pkt);
@@ -211,7 +211,7 @@ bool wccp_retry_network(wccp_interface *interface) {
         return false;
     if (interface->network_flaws & WCCP_FLAW_SOCKETS) {
         wccp_init_network_by_interface(interface);
-    } else { // sockets that work stay open
+    } else { // only joins have failed: keep the sockets
         interface->network_flaws = 0;
         interface->network_tried = wccp_g.seconds;
         wccp_config_mcast(interface);
@@ -231,7 +231,8 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
             interface->network_error = errno;
             QV_LOG(LC_LOG_ERR, "WCCP: Interface %s: Cannot bind mcast UDP socket to %s:%d. %m",
                    interface->name, addr_text(address).s, WCCP_PORT);
-            // Sending gives the unbound socket another port: a retry needs a new one.
+            // The first send would bind this socket to a port of the kernel's choice, so a retry needs a new
+            // one.
             interface->network_flaws |= WCCP_FLAW_SOCKETS;
             return 1;
         }
@@ -242,14 +243,15 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
     membership.imr_multiaddr.s_addr = raw_word(address);
     membership.imr_interface.s_addr = raw_word(interface->ipa);
     if (setsockopt(interface->mcast_fd, IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof membership) == 0) {
-        if (address != interface->mcast_bound_ipa)
+        if (address !=
+            interface->mcast_bound_ipa) // the kernel delivers only what is sent to the bound address
             QV_LOG(LC_LOG_NOTICE,
                    "WCCP: Interface %s: the multicast socket is bound to %s, so datagrams sent to %s are not "
                    "received",
                    interface->name, addr_text(interface->mcast_bound_ipa).s, addr_text(address).s);
         return 0;
     }
-    if (errno == EADDRINUSE) {
+    if (errno == EADDRINUSE) { // another group has the same address
         QV_LOG(LC_LOG_INFO, "WCCP: Interface %s: We've already subscribed to mcast group: %s",
                interface->name, addr_text(address).s);
         return 0;
@@ -270,7 +272,7 @@ int wccp_config_mcast(wccp_interface *interface) {
 
 namespace {
 
-// What keeps the interface from carrying its groups' packets, first what the others follow from.
+// The reason why the interface cannot carry its groups' packets. Causes come before their consequences.
 wccp_reason_code find_network_fault(const wccp_interface *interface) {
     if (!wccp_if_is_ready(interface) && wccp_get_device(interface->name) == 0)
         return WCCP_REASON_INTERFACE_MISSING;
@@ -292,7 +294,7 @@ void wccp_note_network(wccp_service_group *group) {
     };
     const wccp_interface *interface = group->interfaces[0];
     const wccp_reason_code fault = interface ? find_network_fault(interface) : WCCP_REASON_NONE;
-    for (const wccp_reason_code each : faults)
+    for (const wccp_reason_code each : faults) // at most one of them is active
         if (each != fault)
             wccp_forget_reasons(group, each);
     if (fault == WCCP_REASON_NONE)

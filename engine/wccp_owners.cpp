@@ -1,3 +1,4 @@
+// Collects the owners of the slots and prints them. Lock held, except in wccp_print_owners.
 #include "engine/wccp_owners.h"
 
 #include <cstring>
@@ -10,7 +11,7 @@ namespace {
 
 constexpr be32 NO_OWNER = {};
 
-// The lowest set bits of `mask` take the lowest bits of `*inout_index`, which are used up.
+// Distributes the low bits of `*inout_index` over the set bits of `mask`, lowest first, and shifts them out.
 uint32_t spread_index_bits(uint32_t mask, uint32_t *inout_index) {
     uint32_t value = 0;
     for (; mask != 0; mask &= mask - 1, *inout_index >>= 1)
@@ -20,17 +21,19 @@ uint32_t spread_index_bits(uint32_t mask, uint32_t *inout_index) {
 }
 
 bool is_mask_value(const wccp_mask &mask, uint32_t index, const wccp_wire_mask &found) {
+    // In the order in which the bits of the mask are numbered.
     return to_host(found.dst_port) == spread_index_bits(mask.dst_port, &index) &&
            to_host(found.src_port) == spread_index_bits(mask.src_port, &index) &&
            to_host(found.dst_ip) == spread_index_bits(mask.dst_ip, &index) &&
            to_host(found.src_ip) == spread_index_bits(mask.src_ip, &index);
 }
 
-// What a router reports of one appliance. Bits of an earlier report stay where nothing is assigned.
+// Whether a router assigns the slot to an appliance. With nothing assigned, the bits are those of an earlier
+// report.
 bool router_assigns_slot(const wccp_rtr_view_appliance *entry, bool by_mask, uint32_t slot) {
     if (entry->buckets_assigned == 0)
         return false;
-    if (!by_mask) { // the word is in host order, and bucket 0 is the lowest bit of the first byte on the wire
+    if (!by_mask) { // words are in host order; on the wire, bucket 0 is the lowest bit of the first byte
         const be32 word = to_be32(entry->bucket_bits[slot / 32]);
         return word.bytes[slot / 8 % 4] >> slot % 8 & 1;
     }
@@ -45,9 +48,11 @@ void add_reported_owners(const wccp_sending_router *router, bool by_mask, uint32
                 owners[slot] = router->view_appliances[i].ipa;
 }
 
-// Slots whose owners are known, or 0. A router with another order of values says nothing that could be used.
+// Returns `slots` when the owner of at least one slot is known, otherwise 0. A router whose values are in
+// another order makes all reports unusable.
 uint32_t find_slot_owners(const wccp_service_group *group, bool by_mask, uint32_t slots, be32 *owners) {
     memset(owners, 0, sizeof *owners * WCCP_MAX_BUCKETS);
+    // A designated appliance without a table asks the routers, like any other.
     if (group->designated == 1 && group->bucket_count == slots && group->dsg_active_count != 0) {
         memcpy(owners, group->bucket_ipa, sizeof *owners * slots);
         return slots;

@@ -1,24 +1,23 @@
-// Packet I/O of the interfaces.
+// Packet I/O of the interfaces: UDP over IPv4, one datagram per message.
 //
-// Descriptors are written with the engine lock held. Sending also happens under the engine lock, on whichever
-// thread holds it. The receive thread of an interface works without it.
+// Sending runs with the engine lock held, on whichever thread holds it. Receiving runs on the receive thread
+// of an interface without the engine lock.
 //
-// The descriptor lock. A receive thread waits on descriptor numbers. While it waits, a number can be closed
-// and reused for another file: a socket of another interface, or the session with mgmtd. The two cells of an
-// interface therefore change under a small mutex, taken after all others, and the receive thread takes that
-// mutex twice: to copy the numbers that it waits on, and, once something is ready, to read from the number
-// that its interface has by then, without blocking. What it reads always belongs to its interface. After a
-// wakeup for a number that has changed hands it finds nothing and waits again. It waits with poll, which
-// takes descriptors of any size, holding no lock and for a second at most.
+// The descriptor lock. While a receive thread waits on a descriptor, the socket can be closed and its number
+// reused for another file, such as a socket of another interface or the session with mgmtd. The descriptors
+// of an interface therefore change only under a small mutex, which is taken after all other locks. The
+// receive thread takes it twice: to copy the numbers that it waits on, and after the wait, to read without
+// blocking from whatever socket its interface has by then. What it reads therefore always belongs to its
+// interface; if the number has changed in between, it reads nothing and waits again. It holds no lock during
+// the wait, which uses poll, because select cannot handle descriptors of 1024 and above.
 //
-// Sending never waits. The kernel resolves the address of a router that has left the network for three
-// seconds, and datagrams for it stay in the socket's send buffer meanwhile; a few such routers in many groups
-// fill it. A send that waited then would block the engine lock, and with it the tick and all reception. The
-// buffer is large, and a message that finds it full is lost as it would be in the network; the next one
-// follows with its timer.
+// Sending never blocks. While the kernel tries to resolve the address of a router that has left the network,
+// for about three seconds, datagrams for it stay in the socket's send buffer, and a few such routers in many
+// groups fill it. A blocking send would then hold up the engine lock, and with it the tick and all reception.
+// A message that finds the buffer full is lost, as it could be in the network; its timer sends the next one.
 //
-// A datagram that is longer than the receive buffer is cut. The length passed on is the length of the buffer,
-// and the check of the message's own length refuses it.
+// A datagram longer than the receive buffer is truncated. The check of the message's own length then refuses
+// it.
 
 #include "engine/wccp_packet_io.h"
 
@@ -41,7 +40,7 @@ pthread_mutex_t descriptor_lock = PTHREAD_MUTEX_INITIALIZER;
 
 void close_descriptor(int32_t *cell) {
     const mutex_guard guard(&descriptor_lock);
-    if (*cell > 0)
+    if (*cell > 0) // an interface that was never set up holds 0
         close(*cell);
     *cell = -1;
 }
@@ -95,7 +94,7 @@ int32_t wccp_tx_pkt(wccp_service_group *group, wccp_pkt *pkt) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: transmit: interface is not set", group->id);
         return 0;
     }
-    if (!interface->ucast_bound)
+    if (!interface->ucast_bound) // an unbound socket would send from a port of the kernel's choice
         return 0;
     if (!is_zero(pkt->ipa))
         return send_datagram(group, interface->ucast_fd, pkt, pkt->ipa);
@@ -131,6 +130,7 @@ int32_t wccp_rx_pkt(wccp_interface *interface, wccp_pkt *pkt, uint32_t length) {
     ssize_t received;
     {
         const mutex_guard guard(&descriptor_lock);
+        // A ready unicast socket is read by the next call if both are ready.
         const int fd = ready[MCAST].revents ? interface->mcast_fd : interface->ucast_fd;
         if (fd == -1)
             return 0;

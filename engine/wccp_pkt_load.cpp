@@ -1,14 +1,15 @@
-// The writer's side of the wire format.
+// The encoder of sent messages.
 //
-// Messages are written into a wccp_pkt of the group, or of a removal reply, under the engine lock, on the
-// timer thread or whichever thread holds it. The buffer is all zero before the first load, and a load writes
-// only what isn't zero. The only way into it is place<T>(), which gives a component's place if all of it fits
-// into 4096 bytes, and moves nothing; advance() is called once the component is complete. A load that fails
-// therefore leaves the packet as it was, and its builder gives the message up.
+// Messages are written into the group's wccp_pkt, or into that of a removal reply, with the engine lock held,
+// by the timer thread or by any thread that stops a group or receives a query. The buffer is all zero before
+// the first component, and zero fields are not written. Every write goes through find_room<T>(), which
+// returns the component's place if all of it fits into 4096 bytes; commit_component() advances the cursor
+// once the component is complete. A component that fails therefore leaves the cursor where it was, and the
+// builder abandons the message.
 //
-// A message carries the group's present state, and nothing is remembered from one message to the next except
-// one count: each Redirect-Assign that names a router adds 1 to its `assign_tx_count`, from which the test of
-// acknowledgements knows how many have been sent.
+// A message carries the group's present state. Nothing is kept from one message to the next but
+// assign_tx_count: each Redirect-Assign that names a router adds 1 to it, and the acknowledgement rule of
+// wccp_pkt_mgr.cpp reads it.
 #include "engine/wccp_pkt_load.h"
 
 #include <cstring>
@@ -19,7 +20,7 @@
 
 namespace {
 
-// Where a component of `size` bytes that begins as a T goes; null when it does not fit.
+// The place for a component of `size` bytes that begins with a T, or null when it does not fit.
 template <typename T>
 T *find_room(wccp_pkt *pkt, uint64_t size = sizeof(T)) {
     static_assert(alignof(T) == 1);
@@ -128,7 +129,7 @@ int wccp_pkt_load_web_cache_view_info_component(wccp_service_group *group, wccp_
     view->head = make_component_head(WCCP_WEB_CACHE_VIEW_INFO, size);
     view->change_number = to_be32(group->change_number);
     view->routers = to_be32(group->sending_router_count);
-    // A list may be shorter than its count: the places of what isn't there stay zero.
+    // A list that is shorter than its count leaves zero elements.
     auto *const elements = reinterpret_cast<wccp_wire_view_router_element *>(view + 1);
     auto *element = elements;
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
@@ -140,11 +141,11 @@ int wccp_pkt_load_web_cache_view_info_component(wccp_service_group *group, wccp_
     return commit_component(pkt, size);
 }
 
-// What the two forms of the assignment have in common.
+// --- The two forms of the assignment
 
 namespace {
 
-// Writes the router elements and returns the place after them.
+// Writes the router elements and returns a pointer past them.
 uint8_t *write_router_elements(const wccp_service_group *group, void *elements) {
     auto *const first = static_cast<wccp_wire_assign_router_element *>(elements);
     auto *element = first;
@@ -157,8 +158,8 @@ uint8_t *write_router_elements(const wccp_service_group *group, void *elements) 
     return reinterpret_cast<uint8_t *>(first + group->sending_router_count);
 }
 
-// The line, with group id and both numbers, when the appliances don't have all slots. The message goes out
-// all the same.
+// Logs `line`, a format for the group's id and two counts, when the appliances do not hold all slots
+// together. The message is sent regardless.
 void log_unassigned_slots(const wccp_service_group *group, const char *line) {
     uint32_t assigned = 0;
     for (uint32_t i = 0; i < group->dsg_active_count; i++)

@@ -1,21 +1,22 @@
-// The message loop in both directions: one received packet from its header to the views, and the three kinds
-// of packet that this appliance sends.
+// The message processing in both directions: a received packet from its header to the views, and the three
+// kinds of packet that this appliance sends.
 //
-// Reception runs on the receive thread of the interface, whose stack holds the packet. Transmission runs on
-// the timer thread, or on whichever thread stops a group. Both hold the engine lock throughout, so the
-// group's one transmit packet needs no other protection. A packet is built anew for every Here-I-Am and
-// Redirect-Assign; a removal reply is built when its query comes and is sent unchanged each time.
+// Reception runs on the receive thread of an interface, whose stack holds the packet. Transmission runs on
+// the timer thread or on the thread that stops a group. Both hold the engine lock throughout, so the group's
+// single transmit packet needs no other protection. It is built anew for every Here-I-Am and Redirect-Assign;
+// a removal reply is built when its query arrives and is sent unchanged each time.
 //
-// Anybody can send to the port. A packet's length is checked, then its group and security, then its contents.
-// Only a complete I-See-You of a router that may join reaches the group's records: until the router's record
-// is updated, nothing but counters changes. What has been updated is not rolled back when a later step fails.
+// Anybody can send to the port. The order of checks is: length, version, type, group, security, contents.
+// Only a complete I-See-You from a router that may join reaches the group's records; up to that point only
+// counters and reasons change. A step that fails later does not undo the ones before it.
 //
-// Two tables list what messages consist of: the optional components of an I-See-You with their readers, and
-// the build steps of the messages that are sent with their loaders. A step that fails is logged with its
-// words.
+// Two tables list what messages consist of: the optional components of an I-See-You with their decoders, and
+// the build steps of the sent messages with their encoders. A step that fails is logged by its name in the
+// table.
 //
-// An acknowledgement counts from the second Redirect-Assign on: when a router reports the key after the first
-// one, its I-See-You may have crossed with the message.
+// Acknowledgements. A router acknowledges an assignment by reporting its key, the address of the designated
+// appliance and a number. That counts only after at least two Redirect-Assign messages have named the router,
+// so that every router is sent every table at least twice.
 #include "engine/wccp_pkt_mgr.h"
 
 #include <cstring>
@@ -34,7 +35,7 @@ namespace {
 
 constexpr uint32_t OPTIONAL_COMPONENTS = 3; // in one I-See-You
 
-// A step of reading or building a message failed.
+// Logs that a step of decoding or building a message failed, and returns `status`.
 int log_failed_step(const char *words, int status) {
     WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: %s failed.", words);
     return status;
@@ -45,9 +46,9 @@ void note_malformed_message(wccp_service_group *group, const wccp_pkt *pkt, cons
     wccp_note_reason(group, WCCP_REASON_MESSAGE_MALFORMED, pkt->ipa, offered, wanted);
 }
 
-// An I-See-You.
+// --- An I-See-You
 
-// What an I-See-You says, all of it, before any of it is acted upon.
+// The contents of an I-See-You, decoded completely before anything is changed by it.
 struct icu_message {
     be32 router_id;
     be32 receive_id;
@@ -82,7 +83,7 @@ const optional_component optional_components[] = {
     {WCCP_CAPABILITY_INFO, "unloading capability comp.", read_capabilities},
 };
 
-// Also refuses what is too short to be a component.
+// Reads one component; one of an unknown type is skipped. Fewer bytes than a component's head are refused.
 int read_optional_component(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
     const uint16_t type = wccp_pkt_next_component_type(pkt);
     for (const optional_component &row : optional_components) {
@@ -101,11 +102,11 @@ wccp_reason_text format_service(uint32_t priority, uint32_t protocol, uint32_t f
     return wccp_reason_value("priority %u, protocol %u, flags 0x%x", priority, protocol, flags);
 }
 
-// The message as a whole: its components in their order, and no change of the group but its reasons.
+// Decodes the whole message. Changes nothing in the group but its counters and reasons.
 int read_i_see_you(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_service_info *service,
                    icu_message *icu) {
     *icu = {};
-    icu->offered = {WCCP_METHOD_GRE, WCCP_ASSIGN_HASH, WCCP_METHOD_GRE};
+    icu->offered = {WCCP_METHOD_GRE, WCCP_ASSIGN_HASH, WCCP_METHOD_GRE}; // without a Capability Info
     const wccp_wire_router_identity *identity;
     if (const int status = wccp_pkt_unload_router_identity_info_component(group, pkt, &identity))
         return log_failed_step("unloading router identity", status);
@@ -123,14 +124,15 @@ int read_i_see_you(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_ser
             "protocol: rxed = %u local = %u, service flags: rxed = 0x%x local =  0x%x",
             group->id, addr_text(icu->router_id).s, service->priority, group->priority, service->protocol,
             group->protocol, flags, group->service_flags);
-        group->rx_service_mismatches++;
+        group->rx_service_mismatches++; // only counted: the router is accepted
     }
     if (const int status = wccp_pkt_unload_router_view_component(group, pkt, &icu->view))
         return log_failed_step("unloading router view", status);
     for (uint32_t count = 0; pkt->offset < pkt->length;) {
         if (const int status = read_optional_component(group, pkt, icu))
             return status;
-        if (++count > OPTIONAL_COMPONENTS) {
+        if (++count >
+            OPTIONAL_COMPONENTS) { // tested after the component has been read and could be refused itself
             WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: ICU bogus packet  (too many optional components).",
                           group->id);
             note_malformed_message(group, pkt, wccp_reason_value("%u optional components", count),
@@ -141,13 +143,13 @@ int read_i_see_you(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_ser
     return 0;
 }
 
-// The router's record, made from its first I-See-You. Null, with the status that ends the processing, when it
-// may not join.
+// The router's record, created by its first I-See-You. Null when it may not join; `out_status` is then the
+// result of the processing.
 wccp_sending_router *find_or_create_router(wccp_service_group *group, const icu_message *icu,
                                            int *out_status) {
     *out_status = 0;
     if (wccp_sending_router *router = wccp_find_sending_router(group, icu->router_id))
-        return router;
+        return router; // what it offers now has no effect
     wccp_rtr_capabilities agreed;
     uint32_t compatible;
     *out_status =
@@ -170,7 +172,7 @@ void check_acknowledgement(wccp_service_group *group, wccp_sending_router *route
         wccp_forget_reason(group, WCCP_REASON_NOT_ACKNOWLEDGED, router->router_id);
         if (group->pending_acks != 0)
             group->pending_acks--;
-        if (group->pending_acks == 0)
+        if (group->pending_acks == 0) // all routers have the table: nothing to repeat
             group->assign_timer.active = 0;
         return;
     }
@@ -180,13 +182,13 @@ void check_acknowledgement(wccp_service_group *group, wccp_sending_router *route
            group->id, addr_text(router->router_id).s, addr_text(group->appliance_ipa).s,
            group->dsg_key_change, addr_text(view->key_ipa).s, key_change,
            static_cast<int>(router->assign_tx_count), group->pending_acks);
-    if (router->assign_tx_count > 1)
+    if (router->assign_tx_count > 1) // before that nothing is wrong
         wccp_note_reason(group, WCCP_REASON_NOT_ACKNOWLEDGED, router->router_id,
                          format_assignment_key(view->key_ipa, key_change),
                          format_assignment_key(group->appliance_ipa, group->dsg_key_change));
 }
 
-// Takes the values of an Assignment Map into the router's view, and counts those of this appliance.
+// Stores the values of an Assignment Map in the router's last report, and counts those of this appliance.
 wccp_assign_summary apply_assignment_map(const wccp_service_group *group, wccp_sending_router *router,
                                          const wccp_assign_map_info *map) {
     router->map_src_ip = to_host(map->masks->mask.src_ip);
@@ -203,11 +205,12 @@ wccp_assign_summary apply_assignment_map(const wccp_service_group *group, wccp_s
         const be32 id = map->values[i].appliance_id;
         if (id == group->appliance_ipa)
             summary.self_count++;
-        if (i == 0 || !(id == map->values[i - 1].appliance_id))
+        if (i == 0 ||
+            !(id == map->values[i - 1].appliance_id)) // values of one appliance are usually consecutive
             entry = wccp_get_router_appliance_view_element(router, id);
-        if (!entry)
+        if (!entry) // the router does not list this appliance
             continue;
-        if (i < WCCP_MAX_BUCKETS) {
+        if (i < WCCP_MAX_BUCKETS) { // bucket_bits has no room for more
             uint8_t *byte = reinterpret_cast<uint8_t *>(entry->bucket_bits) + i / 8;
             *byte = static_cast<uint8_t>(*byte | 1u << (i % 8));
         }
@@ -217,13 +220,14 @@ wccp_assign_summary apply_assignment_map(const wccp_service_group *group, wccp_s
     return summary;
 }
 
-// The mask that the router uses, as the designated appliance gave it.
+// Compares the mask that the router uses, which the designated appliance sent it, with this group's.
 void note_mask_difference(wccp_service_group *group, const wccp_sending_router *router,
                           const wccp_wire_mask *mask) {
     const bool same =
         to_host(mask->src_ip) == group->mask_src_ip && to_host(mask->dst_ip) == group->mask_dst_ip &&
         to_host(mask->src_port) == group->mask_src_port && to_host(mask->dst_port) == group->mask_dst_port;
-    // A designated appliance has given it itself, or will; too wide a mask is replaced by every appliance.
+    // The designated appliance has sent its own mask or will do so; every appliance replaces a mask of too
+    // many bits by the same default.
     if (same || group->designated == 1 || group->mask_bits > WCCP_MAX_MASK_BITS)
         return;
     const auto text = [](uint32_t src_ip, uint32_t dst_ip, uint32_t src_port, uint32_t dst_port) {
@@ -235,7 +239,7 @@ void note_mask_difference(wccp_service_group *group, const wccp_sending_router *
         text(group->mask_src_ip, group->mask_dst_ip, group->mask_src_port, group->mask_dst_port));
 }
 
-// Another appliance that assigns by another method shows in the form of its entry in the router's view.
+// An appliance that is configured for another method shows in the form of its element in the router's view.
 void note_method_differences(wccp_service_group *group, const wccp_sending_router *router,
                              const wccp_rtr_view_appliance *decoded, uint32_t count, uint32_t by_mask) {
     for (uint32_t i = 0; i < count; i++) {
@@ -267,6 +271,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
     if (!router)
         return status;
 
+    // From here on the group changes, and nothing is undone when a later step fails.
     router->receive_id = icu.receive_id;
     router->last_icu_time = wccp_g.seconds;
     router->src_ipa = pkt->ipa;
@@ -285,7 +290,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
     if (status != 0)
         return status;
     if (icu.map.present) {
-        if (!icu.map.masks || !icu.map.values) {
+        if (!icu.map.masks || !icu.map.values) { // the decoder accepts a map of 0 mask elements
             note_malformed_message(group, pkt, wccp_reason_value("an assignment map without a mask"), {});
             return 1;
         }
@@ -295,7 +300,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
     note_method_differences(group, router, decoded, icu.view.appliance_count, hash.mask_forms);
     note_missing_listing(group, router);
     status = wccp_update_appliance_redirect_status(group, router, &hash, &mask);
-    if (status == 0)
+    if (status == 0) // complete: earlier refusals of this router no longer matter
         wccp_forget_refusals(group, router->router_id, pkt->ipa);
     return status;
 }
@@ -313,7 +318,7 @@ int wccp_pkt_process_removal_query(wccp_service_group *group, wccp_pkt *pkt) {
     return wccp_process_router_removal_query(group, query->router_id, query->receive_id);
 }
 
-// A packet.
+// --- A received packet
 
 namespace {
 
@@ -323,7 +328,7 @@ int refuse_packet(const wccp_pkt *pkt) {
     return 1;
 }
 
-// `digest` lies in the packet and is zero afterwards.
+// `digest` points into the packet. It is zeroed, because the digest was computed with these bytes zero.
 bool verify_digest(const wccp_service_group *group, const wccp_pkt *pkt, uint8_t *digest) {
     uint8_t received[MD5_DIGEST_BYTES], computed[MD5_DIGEST_BYTES];
     memcpy(received, digest, sizeof received);
@@ -337,7 +342,7 @@ wccp_reason_text format_security_option(uint32_t option) {
                        : wccp_reason_value("option %u", option);
 }
 
-// True when the packet has the security that the group asks for.
+// Whether the packet has the security that the group is configured for.
 bool check_security(wccp_service_group *group, const wccp_pkt *pkt, const wccp_wire_security_info *security,
                     uint8_t *digest) {
     const uint32_t option = to_host(security->option);
@@ -406,6 +411,8 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
         log_failed_step("unloading service info", 1);
         return refuse_packet(pkt);
     }
+    // The group is found by its id alone, whatever the service type and the interface that the packet came in
+    // on.
     wccp_service_group *group = wccp_find_group(service->service_id);
     if (!group) {
         WCCP_COMPLAIN(LC_LOG_WARNING, "WCCP GRP %d: rxed service group (%d) is not configured.",
@@ -419,7 +426,8 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
         wccp_note_reason(group, WCCP_REASON_GROUP_DISABLED, pkt->ipa, {}, {});
         return 0;
     }
-    // Queued in the socket, or held by the receive thread, while the group was stopped.
+    // The packet was queued in the socket, or the receive thread waited for the lock, while the group
+    // stopped.
     if (!wccp_group_is_running(group)) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: is not running. dropping the rxed packet.", group->id);
         wccp_note_reason(group, WCCP_REASON_GROUP_STOPPED, pkt->ipa, {}, {});
@@ -441,24 +449,24 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
     return 0;
 }
 
-// What is sent.
-
 namespace {
+
+// --- Building messages
 
 struct message_build {
     wccp_service_group *group;
     wccp_pkt *pkt;
-    uint8_t *digest; // its place in the packet, once Security Info is there
+    uint8_t *digest; // its place in the packet, once Security Info has been written
 };
 using step_condition = bool (*)(const wccp_service_group *group);
 
 struct build_step {
-    const char *words;
+    const char *words; // for the log
     int (*load)(message_build *build);
     step_condition wanted; // null: always
 };
 
-// A load that takes group and packet, as a step.
+// Adapts an encoder that takes group and packet.
 template <int (*Load)(wccp_service_group *, wccp_pkt *)>
 int run_load(message_build *build) {
     return Load(build->group, build->pkt);
@@ -533,8 +541,10 @@ int run_build_steps(const build_step (&steps)[Count], wccp_reason_code reason, w
     return 0;
 }
 
-// A kind of packet for wccp_transmit_packet: its name in the log, the counter of its attempts, and how it is
-// written; null when it comes finished.
+// --- Sending
+
+// A kind of packet for wccp_transmit_packet: its name in the log, the counter of attempts, and its builder,
+// null when the packet is sent as it is.
 struct packet_kind {
     uint32_t number;
     const char *name;
@@ -577,7 +587,7 @@ int wccp_transmit_packet(wccp_service_group *group, wccp_pkt *pkt, uint32_t numb
         return 1;
     }
     const wccp_interface *interface = group->interfaces[0];
-    if (!wccp_if_is_ready(interface)) {
+    if (!wccp_if_is_ready(interface)) { // not a failure: the group waits for its interface
         group->tx_link_drops++;
         return 0;
     }
@@ -587,7 +597,7 @@ int wccp_transmit_packet(wccp_service_group *group, wccp_pkt *pkt, uint32_t numb
         group->tx_failures++;
         return 1;
     }
-    group->*kind->attempts += 1;
+    group->*kind->attempts += 1; // attempts count, whatever becomes of them
     if (kind->build) {
         clear_packet(pkt);
         if (const int status = kind->build(group, pkt)) {
@@ -599,7 +609,7 @@ int wccp_transmit_packet(wccp_service_group *group, wccp_pkt *pkt, uint32_t numb
     const int32_t sent = wccp_tx_pkt(group, pkt);
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: %s: sent %s to %s %d/%d (bytes)", group->id, interface->name,
            kind->name, addr_text(pkt->ipa).s, sent, static_cast<int>(pkt->length));
-    if (sent != 0)
+    if (sent != 0) // also -1: only a packet without any destination counts as failed
         return 0;
     group->tx_failures++;
     return 1;

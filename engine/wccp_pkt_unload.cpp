@@ -1,20 +1,21 @@
-// The reader's side of the wire format, the only place where bytes of a received message are looked at.
+// The decoder of received messages, the only place where their bytes are read.
 //
-// A packet lies in the buffer of the receive thread that took it from the socket; that thread holds the
-// engine lock from here to the end of the packet's processing. Nothing is copied except the fixed fields of a
-// result, and nothing is allocated: the rest of a result points into the packet and is good until the thread
-// receives again. No group changes here, apart from its reasons and one counter of unknown capabilities.
+// A packet lies in a buffer on the stack of the receive thread, which holds the engine lock from here to the
+// end of the packet's processing. Decoding copies only the fixed fields of a result and allocates nothing;
+// the pointers in a result point into the packet and are valid until the thread receives the next one. The
+// only changes in a group are its reasons and the counter of unknown capabilities.
 //
-// Any message may be hostile, so there is one way to its bytes: look<T>() gives a layout at a distance after
-// the cursor if all of it was received, and null otherwise. A test that has a log line of its own comes
-// first, but look() follows it all the same, and no count from the wire is used before it has been compared
-// with the bytes received. Sizes are added up in 64 bits, because a 32-bit count times 16 would wrap.
+// Any message may be hostile. Every read goes through peek_layout<T>(), which returns a pointer to a layout
+// at a distance from the cursor if all of it was received, and null otherwise. Where a check has a log line
+// of its own it comes first, but the read is still bounded by peek_layout. Counts from the wire are compared
+// with the bytes received before they are used. Sizes are computed in 64 bits, because a 32-bit count times
+// 16 can wrap.
 //
-// A component of odd length leaves everything after it at odd addresses. The wire layouts have alignment 1,
-// so they may be read wherever they begin.
+// After a component of odd length everything that follows is at odd addresses. The wire layouts have
+// alignment 1, so they can be read anywhere.
 //
-// A refused component leaves the cursor where it was. Its message ends there, and the caller logs which step
-// failed.
+// A refused component leaves the cursor where it was. The caller logs which step failed and drops the
+// message.
 #include "engine/wccp_pkt_unload.h"
 
 #include <cinttypes>
@@ -24,22 +25,22 @@
 #include "engine/wccp_complaints.h"
 #include "engine/wccp_utils.h"
 
-// The cursor.
-
 namespace {
 
-// A stretch of received bytes.
+// --- The cursor
+
 struct received_bytes {
     const uint8_t *first;
     uint32_t size;
 };
 
 uint32_t count_remaining_bytes(const wccp_pkt *pkt) {
+    // Reads stay within the buffer even if a caller has set a wrong length.
     const uint32_t received = pkt->length < WCCP_MAX_PACKET ? pkt->length : WCCP_MAX_PACKET;
     return pkt->offset < received ? received - pkt->offset : 0;
 }
 
-// `count` Ts at `distance` bytes from the first one; null when not all of them were received.
+// `count` objects of type T at `distance` bytes from the first byte, or null when not all were received.
 template <typename T>
 const T *peek_layout(received_bytes bytes, uint64_t distance = 0, uint64_t count = 1) {
     static_assert(alignof(T) == 1);
@@ -47,13 +48,13 @@ const T *peek_layout(received_bytes bytes, uint64_t distance = 0, uint64_t count
         return nullptr;
     return reinterpret_cast<const T *>(bytes.first + distance);
 }
-// The same from the packet's cursor.
+// The same, from the packet's cursor.
 template <typename T>
 const T *peek_layout(const wccp_pkt *pkt, uint64_t distance = 0, uint64_t count = 1) {
     return peek_layout<T>({pkt->data + pkt->offset, count_remaining_bytes(pkt)}, distance, count);
 }
 
-// Moves on by `size` bytes, 0; or not at all, 1, when they were not received.
+// Moves the cursor past `size` bytes. 1, and it stays, when they were not received.
 int skip_bytes(wccp_pkt *pkt, uint64_t size) {
     if (size > count_remaining_bytes(pkt))
         return 1;
@@ -62,14 +63,14 @@ int skip_bytes(wccp_pkt *pkt, uint64_t size) {
     return 0;
 }
 
-// Notes why a message is refused, with what it has and what it should have; gives 1.
+// These note why a message is refused, with what it has and what it should have, and return 1.
 int refuse_message(wccp_service_group *group, const wccp_pkt *pkt, const wccp_reason_text &has,
                    const wccp_reason_text &should_have,
                    wccp_reason_code code = WCCP_REASON_MESSAGE_MALFORMED) {
     wccp_note_reason(group, code, pkt->ipa, has, should_have);
     return 1;
 }
-// The same of a component that does not fit, or whose own length is another than it should be.
+// For a component that does not fit in the message, or whose length field is wrong.
 int refuse_message_size(wccp_service_group *group, const wccp_pkt *pkt, const char *what, uint64_t size,
                         uint64_t should_be) {
     return refuse_message(group, pkt, wccp_reason_value("%s of %" PRIu64 " bytes", what, size),
@@ -80,14 +81,14 @@ int refuse_component_type(wccp_service_group *group, const wccp_pkt *pkt, uint32
                           wccp_reason_value("type %u", should_be));
 }
 
-// A size as an argument for the %d of a log line.
+// A size as an argument for %d in a log line.
 int clamp_to_int(uint64_t size) {
     return size < INT_MAX ? static_cast<int>(size) : INT_MAX;
 }
 
 } // namespace
 
-// The way every message begins.
+// --- The beginning of every message
 
 int wccp_pkt_unload_msg_header(wccp_pkt *pkt, const wccp_wire_msg_header **out) {
     *out = peek_layout<wccp_wire_msg_header>(pkt);
@@ -108,7 +109,7 @@ int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_secur
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP: expected security componenet. rxed %d", to_host(info->head.type));
         return refuse_component_type(nullptr, pkt, to_host(info->head.type), WCCP_SECURITY_INFO);
     }
-    if (to_host(info->head.length) > size - sizeof info->head)
+    if (to_host(info->head.length) > size - sizeof info->head) // a smaller length is accepted
         return refuse_message_size(nullptr, pkt, "a security info", to_host(info->head.length),
                                    size - sizeof info->head);
     uint8_t *const digest = pkt->data + pkt->offset + offsetof(wccp_wire_security_md5, digest);
@@ -136,7 +137,7 @@ int wccp_pkt_unload_service_info_component(wccp_pkt *pkt, const wccp_wire_servic
     return skip_bytes(pkt, sizeof *info);
 }
 
-// The components of an I-See-You that each one has.
+// --- The components that every I-See-You has
 
 int wccp_pkt_unload_router_identity_info_component(wccp_service_group *group, wccp_pkt *pkt,
                                                    const wccp_wire_router_identity **out) {
@@ -188,8 +189,8 @@ wccp_element_shape wccp_view_element_shape(uint16_t flags, uint32_t compat_mode)
 
 namespace {
 
-// The size of a router view whose `count` elements begin at `distance`. False when not all of them were
-// received.
+// Outputs the size of a router view whose `count` elements begin at `distance`. False when not all of them
+// were received.
 bool measure_router_view(const wccp_service_group *group, const wccp_pkt *pkt, uint64_t distance,
                          uint32_t count, uint64_t *out_size) {
     for (uint32_t i = 0; i < count; i++) {
@@ -229,8 +230,8 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
                                    sizeof *view + routers * sizeof *addresses);
     }
     const uint32_t elements_at = static_cast<uint32_t>(sizeof *view + (routers + 1) * sizeof(be32));
-    // Where the count was cut off there are no appliances; the view then doesn't fit, because the count
-    // doesn't.
+    // Without the count of appliances, measure_router_view below refuses the view, because the count is
+    // included in `elements_at`.
     const auto *count = peek_layout<be32>(pkt, elements_at - sizeof(be32));
     const uint32_t appliances = count ? to_host(*count) : 0;
     if (appliances > WCCP_MAX_APPLIANCES) {
@@ -270,13 +271,13 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
     return skip_bytes(pkt, size);
 }
 
-// The web-cache elements of a Router View.
+// --- The web-cache elements of a Router View
 
 namespace {
 
-// Takes the bucket bits of an element over; the number of buckets that they assign. The bits are added up
-// side by side in one word: without a machine instruction for it, eight calls that count one word each would
-// be the most expensive step of a whole I-See-You.
+// Stores the bucket bits of an element and returns how many are set. The bits of two words at a time are
+// added in parallel within one 64-bit word. The build targets processors without a popcount instruction; with
+// eight calls of the library's bit count this would be the most expensive step of an I-See-You.
 uint16_t decode_bucket_bits(const wccp_wire_view_element_hash *element, wccp_rtr_view_appliance *decoded) {
     uint64_t in_bytes = 0;
     for (uint32_t i = 0; i < 8; i += 2) {
@@ -317,14 +318,14 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
         if (!weight || (by_hash && !hash))
             return 1;
         decoded->ipa = head->web_cache_id;
-        if (by_hash && to_host(head->hash_revision) != 0) {
+        if (by_hash && to_host(head->hash_revision) != 0) { // refuses the whole message
             WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: HASH revision is not supported.", group->id);
             return 1;
         }
         decoded->weight = to_host(*weight);
         hash_summary->mask_forms |= by_hash ? 0 : 1u << i;
         if (shape.form == WCCP_ELEMENT_REDIRECT) {
-            hash_summary->valid = 0; // the assignment comes as a map
+            hash_summary->valid = 0; // the assignment comes as an Assignment Map
         } else if (by_hash && flags & WCCP_IDENTITY_HISTORICAL) {
             QV_LOG(LC_LOG_INFO, "WCCP GRP %d: app id. %s assignment is historical, ignored", group->id,
                    addr_text(decoded->ipa).s);
@@ -340,7 +341,7 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
     return 0;
 }
 
-// The optional components of an I-See-You.
+// --- The optional components of an I-See-You
 
 int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt *pkt,
                                              wccp_assign_map_info *out) {
@@ -365,10 +366,10 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
                       addr_text(pkt->ipa).s);
         return refuse_message_size(group, pkt, "an assignment map", declared, smallest - head);
     }
-    *out = {}; // a message may have two maps, and the last one counts
+    *out = {}; // it may hold an earlier map of the same message
     out->element_count = to_host(map->mask_elements);
     out->masks = peek_layout<wccp_wire_mask_element>(pkt, sizeof *map);
-    uint64_t size = sizeof *map; // with the component's head
+    uint64_t size = sizeof *map; // including the component's head, which `declared` does not count
     for (uint32_t i = 0; i < out->element_count; i++) {
         const auto *element = peek_layout<wccp_wire_mask_element>(pkt, size);
         const uint64_t values_at = size + sizeof *element;
@@ -382,7 +383,7 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
                 group->id, clamp_to_int(declared), clamp_to_int(size - head));
             return refuse_message_size(group, pkt, "an assignment map", declared, size - head);
         }
-        out->value_count = static_cast<uint32_t>(values);
+        out->value_count = static_cast<uint32_t>(values); // of the last mask element, when the loop ends
         out->values = peek_layout<wccp_wire_value_element>(pkt, values_at, values);
     }
     out->present = 1;
@@ -414,7 +415,7 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
         return refuse_message(group, pkt, wccp_reason_value("a capability info of %u bytes", length),
                               wccp_reason_value("a multiple of %u", element_size));
     }
-    if (length >= (std::size(known) + 1) * element_size)
+    if (length >= (std::size(known) + 1) * element_size) // logged, not refused
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: more capabilities than the known ones. length %d", group->id,
                clamp_to_int(length));
     const auto *element = peek_layout<wccp_wire_capability_element>(pkt, sizeof *head, length / element_size);
@@ -426,7 +427,7 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
         for (const capability &each : known)
             if (each.type == to_host(element->type))
                 found = &each;
-        if (found)
+        if (found) // a repeated capability replaces the earlier one
             out->*found->word = to_host(element->value);
         else
             group->rx_unknown_capabilities++;
@@ -460,6 +461,7 @@ uint16_t wccp_pkt_next_component_type(const wccp_pkt *pkt) {
 
 int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt) {
     const auto *head = peek_layout<wccp_wire_component>(pkt);
+    // A component of one to three bytes has no head; it is refused below with what there is of its type.
     const int type = wccp_pkt_next_component_type(pkt), length = head ? to_host(head->length) : 0;
     if (head && skip_bytes(pkt, sizeof *head + to_host(head->length)) == 0)
         return 0;
@@ -470,7 +472,7 @@ int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt) 
                           wccp_reason_value("%u bytes", count_remaining_bytes(pkt)));
 }
 
-// The one component of a Removal Query.
+// --- The component of a Removal Query
 
 int wccp_pkt_unload_router_query_component(wccp_service_group *group, wccp_pkt *pkt,
                                            const wccp_wire_router_query **out) {

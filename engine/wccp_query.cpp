@@ -1,6 +1,4 @@
-// The questions of the monitoring tree. Each entry point takes the engine lock, copies what was asked for
-// into the caller's record and lets go; nothing that it gives out points into the engine. What is not there
-// leaves the record as the caller made it.
+// The queries of the monitoring tree. Each public function takes the engine lock, copies, and releases it.
 
 #include "engine/wccp_query.h"
 
@@ -17,13 +15,14 @@ void copy_text(char (&field)[Size], const char *text) {
     strlcpy(field, text, Size);
 }
 
-// Value to word; a value past the table is "unknown".
+// The word for a value; "unknown" for a value past the table.
 template <size_t Count>
 const char *find_word(const char *const (&words)[Count], uint32_t value) {
     return value < Count ? words[value] : "unknown";
 }
 
-// The place-th record of a list, counted from 1; the line, with group id and place, where there is none.
+// The record at a place of a list, counted from 1. If there is none, logs `absent`, a format for group id and
+// place.
 template <typename T>
 T *find_nth_or_log(T *head, uint32_t place, const char *absent, int id) {
     for (uint32_t i = 1; head; head = head->next, i++)
@@ -181,11 +180,11 @@ int wccp_get_router_appliance_info(wccp_router_appliance_info *info) {
     return 1;
 }
 
-// Reasons and counters.
+// --- Reasons and counters
 
 namespace {
 
-// The reasons of a group, or with WCCP_NO_GROUP those of no group; null when there is no such group. Lock
+// The table of a group, or with WCCP_NO_GROUP that of packets of no group; null for an unknown group. Lock
 // held.
 const wccp_reason *find_reason_table(int id, uint32_t *out_places) {
     wccp_service_group *group = id == WCCP_NO_GROUP ? nullptr : wccp_find_group(id);

@@ -1,9 +1,10 @@
-// The engine's answers to monitoring. Each entry point takes the engine lock, copies what was asked for into
-// the caller's record and returns; nothing in a record points into the engine. Fields marked "in" are filled
-// by the caller. The result is 0, or 1 for a null record or a group that does not exist; a record whose
-// router or appliance does not exist stays as the caller made it.
+// The engine's answers to monitoring. Each function takes the engine lock, copies what was asked for into the
+// caller's record, and releases the lock; nothing in a record points into the engine. Fields marked "in" are
+// set by the caller. The result is 0, or 1 for a null record or an unknown group. If the router or the
+// appliance does not exist, the functions that return info about one leave the record as it is and return 0;
+// others return 1.
 //
-// Numbers of routers and appliances are places in a list at the moment of the question, from 1.
+// Routers and appliances are numbered from 1 by their position in a list at the moment of the query.
 #pragma once
 
 #include "engine/wccp_records.h"
@@ -17,8 +18,8 @@ struct wccp_grp_info {
     uint32_t num_routers;
     uint32_t num_appliances;
     uint32_t num_view_routers;
-    uint32_t uptime; // seconds
-    uint32_t since;  // seconds since it was started or stopped
+    uint32_t uptime; // seconds in ACTIVE or BACKUP, otherwise 0
+    uint32_t since;  // seconds since it was last started or stopped
     uint32_t pending_acks;
     char oper[128];
 };
@@ -26,7 +27,7 @@ struct wccp_grp_router_info {
     uint32_t router_num; // in, from 1
     be32 router_id;
     be32 src_ipa;
-    uint32_t conn_time; // seconds
+    uint32_t conn_time; // seconds since it became one-way or two-way
     uint32_t heard;     // seconds since its last I-See-You
     char fwd[8];
     char ret[8];
@@ -56,15 +57,16 @@ struct wccp_router_appliance_info {
     uint32_t load_percent;
 };
 
-// Why something does not work (wccp_reasons.h). Places count from 1, and a reason keeps its place.
-constexpr int WCCP_NO_GROUP = -1; // as an id: of packets of no group
+// The reasons why something does not work (wccp_reasons.h). Places are numbered from 1. A reason keeps its
+// place.
+constexpr int WCCP_NO_GROUP = -1; // as a group id: packets that belong to no group
 struct wccp_reason_list {
     uint32_t count;
     uint8_t places[WCCP_GROUP_REASONS];
 };
 struct wccp_reason_info {
-    wccp_reason reason;                 // of code NONE when there is none
-    uint32_t first_before, last_before; // seconds
+    wccp_reason reason;                 // code NONE when the place is free
+    uint32_t first_before, last_before; // seconds since the first and the last occurrence
 };
 struct wccp_interface_info {
     char name[WCCP_IF_NAME_BYTES];
@@ -74,11 +76,11 @@ struct wccp_interface_info {
 
 int wccp_get_reason_list(int id, wccp_reason_list *list);
 int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info);
-// The word of a counter, by its place in their table from 0; null past the last.
+// The name of the counter with this index, from 0; null past the last one. No lock needed.
 const char *wccp_counter_word(uint32_t index);
-uint32_t wccp_read_counter(const wccp_service_group *group, uint32_t index); // of a word there is; lock held
-int wccp_get_counter(int id, const char *word, uint32_t *out);               // also 1 for a word that is none
-// By its place from 0; 1 past the last.
+uint32_t wccp_read_counter(const wccp_service_group *group, uint32_t index); // index valid; lock held
+int wccp_get_counter(int id, const char *word, uint32_t *out);               // also 1 for an unknown name
+// The interface with this index, from 0; 1 past the last one.
 int wccp_get_interface_info(uint32_t index, wccp_interface_info *info);
 
 int wccp_get_grp_list(wccp_grp_list *list);
@@ -89,5 +91,5 @@ int wccp_get_router_list(wccp_router_list *list);
 int wccp_get_router_appliance_list(wccp_router_appliance_list *list);
 int wccp_get_router_appliance_info(wccp_router_appliance_info *info);
 
-// Lock held; null, with an information line, when there is no such group or router.
+// Null, with an information line in the log, when there is no such group or router. Lock held.
 wccp_sending_router *wccp_find_router_instance(int id, uint32_t router_num);

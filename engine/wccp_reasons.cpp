@@ -1,5 +1,6 @@
-// The tables of reasons. They are part of the engine's records: a group's is zero when the group is made and
-// goes with it. Searches are linear over a few dozen entries, which is little beside what a packet costs.
+// The tables of reasons. They are arrays in the engine's records: a group's table is created zeroed and freed
+// with the group, and nothing here allocates memory. Searches are linear over at most 40 entries, which costs
+// little compared with a packet.
 #include "engine/wccp_reasons.h"
 
 #include <cstdarg>
@@ -11,12 +12,12 @@ namespace {
 
 struct code_row {
     const char *word;
-    bool of_packets;      // ends with the next I-See-You of the sender that is taken
-    bool lasting = false; // and not by itself when it is not repeated
+    bool of_packets;      // ends with the next I-See-You of the sender that is accepted
+    bool lasting = false; // does not end after REPEATED_WITHIN either
 };
-constexpr uint32_t REPEATED_WITHIN = 60; // seconds; a router that is refused sends again after ten
+constexpr uint32_t REPEATED_WITHIN = 60; // seconds; a refused router repeats its packet after ten
 
-// By code.
+// Indexed by wccp_reason_code.
 constexpr code_row code_rows[] = {
     {"", false},
     {"message-length", true},
@@ -76,7 +77,7 @@ bool group_has_router(const wccp_service_group *group, be32 address) {
     return false;
 }
 
-// The place for one more reason: a free one, or that of the reason that gives way.
+// The entry to use for a new reason: a free one, otherwise the oldest, strangers first.
 wccp_reason *find_place_for_reason(wccp_service_group *group) {
     uint32_t count;
     wccp_reason *const table = wccp_reasons_of(group, &count), *chosen = table;

@@ -1,13 +1,16 @@
-// Why a group does not work: the last refusals of packets and the last failures of steps, with the values
-// that differed, for monitoring to read. The log has the same in its own words; nobody has to parse it.
+// The reasons why a group does not work: the latest refusals of packets and the latest failures of steps,
+// with the values that differed, for monitoring. The log has the same events in its own words; nobody has to
+// parse it.
 //
-// A reason is known by its code and its sender; another occurrence counts it up and replaces its values. Each
-// group has a table, and the packets of no group share one. Tables have a fixed size and take no memory of
-// their own: a full one gives up its oldest reason, that of a stranger before that of a known router, for
-// anybody can send packets. Reasons that a router's packets give end when an I-See-You of that router is
-// taken, or when no packet has repeated them for a minute; the others end with the step that succeeds.
+// A reason is identified by its code and its sender; when it occurs again, its count rises and its values are
+// replaced. Each group has a table, and one more table in wccp_g is for packets that belong to no group. The
+// tables are arrays of a fixed size in those records. When a table is full, a new reason replaces the oldest
+// one, and those of unknown senders before those of the group's routers, because anybody can send packets.
 //
-// Engine lock held throughout.
+// Reasons that come from a router's packets end when an I-See-You of that router is accepted, and most of
+// them also after a minute without a repetition. All others end when the step that failed succeeds.
+//
+// Lock held for all functions except wccp_reason_word and wccp_reason_value.
 #pragma once
 
 #include <cstdint>
@@ -17,12 +20,12 @@
 struct wccp_service_group;
 
 constexpr uint32_t WCCP_GROUP_REASONS = 40;
-constexpr uint32_t WCCP_OTHER_REASONS = 16; // of packets of no group
-constexpr uint32_t WCCP_REASON_BYTES = 64;  // of a value as text, with its end
+constexpr uint32_t WCCP_OTHER_REASONS = 16; // of packets that belong to no group
+constexpr uint32_t WCCP_REASON_BYTES = 64;  // of a value as text, with the terminating NUL
 
 enum wccp_reason_code : uint8_t {
     WCCP_REASON_NONE,
-    // What is wrong with a packet.
+    // A packet was refused.
     WCCP_REASON_MESSAGE_LENGTH,
     WCCP_REASON_MESSAGE_VERSION,
     WCCP_REASON_MESSAGE_TYPE,
@@ -41,7 +44,7 @@ enum wccp_reason_code : uint8_t {
     WCCP_REASON_ROUTER_ID_ZERO,
     WCCP_REASON_ROUTERS_EXHAUSTED,
     WCCP_REASON_QUERY_REFUSED,
-    // What a router reports, or does not.
+    // A router reports something unexpected, or reports nothing.
     WCCP_REASON_NOT_IN_VIEW,
     WCCP_REASON_ROUTER_SILENT,
     WCCP_REASON_ELECTION_BLOCKED,
@@ -51,7 +54,7 @@ enum wccp_reason_code : uint8_t {
     WCCP_REASON_ASSIGNMENT_DIFFERS,
     WCCP_REASON_NOT_ACKNOWLEDGED,
     WCCP_REASON_APPLIANCE_LEFT_OUT,
-    // What this appliance cannot do.
+    // This appliance failed to do something.
     WCCP_REASON_NO_MEMORY,
     WCCP_REASON_HERE_I_AM_NOT_BUILT,
     WCCP_REASON_TABLE_NOT_BUILT,
@@ -67,37 +70,38 @@ enum wccp_reason_code : uint8_t {
     WCCP_REASON_TUNNEL_IDS_EXHAUSTED,
     WCCP_REASON_TUNNELD_SILENT,
     WCCP_REASON_MAILBOX_MISSING,
-    WCCP_REASON_CODES, // how many there are
+    WCCP_REASON_CODES, // the number of codes
 };
 
 struct wccp_reason_text {
     char s[WCCP_REASON_BYTES];
 };
 struct wccp_reason {
-    wccp_reason_code code; // NONE: the place is free
-    bool stranger;         // the sender is no router of the group
+    wccp_reason_code code; // NONE: this entry is free
+    bool stranger;         // the sender is not a router of the group
     be32 sender;           // router id, source, appliance or destination; 0.0.0.0 for none
     uint32_t count;
-    uint32_t first, last; // wccp_g.seconds
-    wccp_reason_text offered, wanted;
+    uint32_t first, last;             // times of the first and last occurrence
+    wccp_reason_text offered, wanted; // either may be empty
 };
 
 // The stable word of a code, such as "password-mismatch"; "" for none.
 const char *wccp_reason_word(uint32_t code);
-// False for a free place and for a reason that nothing has repeated.
+// Whether the reason is active: false for a free entry, and for a packet's reason that was not repeated.
 bool wccp_reason_holds(const wccp_reason *reason);
-// A value; what is too long is cut.
+// Formats a value; a longer text is truncated.
 __attribute__((format(printf, 1, 2))) wccp_reason_text wccp_reason_value(const char *format, ...);
-// A null group: of a packet that belongs to none.
+// Adds or repeats a reason. Null group: the table for packets that belong to no group.
 void wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sender,
                       const wccp_reason_text &offered, const wccp_reason_text &wanted);
-void wccp_forget_reason(wccp_service_group *group, wccp_reason_code code, be32 sender);
-void wccp_forget_reasons(wccp_service_group *group, wccp_reason_code code); // of all senders
-// The same but for what was noted in this second, by a check that has looked at all senders.
+void wccp_forget_reason(wccp_service_group *group, wccp_reason_code code, be32 sender); // null group as above
+void wccp_forget_reasons(wccp_service_group *group, wccp_reason_code code);             // of all senders
+// Removes those of all senders that were not noted in this second. For a check that looks at all senders and
+// has just noted what it found.
 void wccp_forget_older_reasons(wccp_service_group *group, wccp_reason_code code);
 void wccp_forget_all_reasons(wccp_service_group *group);
-// An I-See-You was taken: what was wrong with earlier packets of that router, by its id and by their source,
-// ends. What was noted in this second stays, since it may be about this very packet.
+// Call it when an I-See-You was accepted: removes the reasons that came from earlier packets with this router
+// id or source. Those noted in this second stay, because they may be about this packet.
 void wccp_forget_refusals(wccp_service_group *group, be32 router_id, be32 source);
-// The table of a group, or of no group, and its size.
+// The table of a group, or with null that of packets of no group, and its number of entries.
 wccp_reason *wccp_reasons_of(wccp_service_group *group, uint32_t *out_count);

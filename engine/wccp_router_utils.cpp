@@ -1,19 +1,15 @@
 // Sending routers: the routers from which a group has accepted an I-See-You.
 //
-// A record is made from a router's first I-See-You, once its capabilities have been found to agree, and lives
-// until the router has been silent for 40 seconds or the group stops. The first router decides the group's
-// forwarding, assignment and return methods for all that follow; they hold until the last router is removed.
-// The records belong to the group's list, and so do the replies to Removal Queries, each a finished message
-// with the number of times that it still has to be sent. Their number is bounded for each router; a query
-// beyond it is refused.
+// A record is created by a router's first I-See-You if its capabilities can be agreed. It lives until the
+// router has sent none for 40 seconds or the group stops. The first router decides the group's forwarding,
+// assignment and return methods; they stay in force until the last router is removed. The records belong to
+// the group's list, and so do the replies to Removal Queries, each a finished message with the number of its
+// remaining transmissions. The number of queued replies is limited for each router.
 //
-// The engine lock is held throughout: by a receive thread for creation, decision and queries, by the timer
-// thread for the sweep and the replies. Nothing here reads a message or changes a view of its own accord.
-//
-// A thread can be cancelled while it waits for tunneld and owns a record. A new record is owned by the scope
-// until it is in the list with its tunnel reference, and wccp_add_tunnel can't be cancelled between the two.
-// A record that is removed is owned by the scope from the moment it leaves the list: however the wait for its
-// tunnel ends, it is freed and the count goes down.
+// The engine lock is held throughout: by a receive thread for the creation, the capability decision and
+// queries, by the timer thread for timeouts and replies. Creating and removing a router that uses GRE can
+// wait for tunneld. Nothing here reads a message; views change only when a router that timed out drops its
+// references.
 #include "engine/wccp_router_utils.h"
 
 #include "engine/wccp_alarms.h"
@@ -29,10 +25,10 @@
 
 namespace {
 
-constexpr uint32_t ROUTER_HOLD_SECONDS = 40; // seconds without an I-See-You
+constexpr uint32_t ROUTER_HOLD_SECONDS = 40; // without an I-See-You
 constexpr uint8_t REPLY_TRANSMISSIONS = 3;
-// Of one router. Each reply holds a whole packet for three seconds, and anybody can send queries. With a
-// bound per router, queries in the name of one cannot keep the others from being answered.
+// For each router. A reply holds a packet of 4 KiB for three seconds, and anybody can send queries. With a
+// limit for each router, forged queries of one router cannot keep the queries of others from being answered.
 constexpr uint32_t MAX_REPLIES_WAITING = 8;
 
 void free_router(wccp_sending_router *router) {
@@ -51,14 +47,14 @@ wccp_sending_router *wccp_find_sending_router(wccp_service_group *group, be32 ro
     return nullptr;
 }
 
-// The capability decision.
-
 namespace {
+
+// --- The capability decision
 
 using capabilities = wccp_rtr_capabilities;
 
-// One of the three methods to agree on: its member, which code wins when both sides can do either, and
-// what is logged, noted and returned when they have none in common.
+// One of the three methods to agree on: its member, the code that is chosen when both sides support either,
+// and what is returned, noted and logged when they have none in common.
 struct capability_step {
     uint32_t capabilities::*word;
     uint32_t (*preferred)(const capabilities *agreed);
@@ -68,7 +64,7 @@ struct capability_step {
     void (*complain)(int group, be32 router_id, const capabilities *local, const capabilities *offered);
 };
 
-// Only the two low bits of an offer mean anything, and as a bit set they are a method code.
+// The low two bits of an offer, a bit set, have the same values as the method codes: 3 is either.
 uint32_t get_offered_method(uint32_t word) {
     return word & WCCP_METHOD_EITHER;
 }
@@ -85,7 +81,7 @@ const capability_step capability_steps[] = {
              wccp_method_name(get_offered_method(offered->forwarding)),
              wccp_method_name(get_offered_method(offered->ret)));
      }},
-    // Mask goes with L2, hash with GRE.
+    // With L2 forwarding mask is preferred, with GRE hash.
     {&capabilities::assignment,
      [](const capabilities *agreed) -> uint32_t {
          return agreed->forwarding == WCCP_METHOD_L2 ? WCCP_ASSIGN_MASK : WCCP_ASSIGN_HASH;
@@ -111,9 +107,9 @@ const capability_step capability_steps[] = {
      }},
 };
 
-// The code that both sides can do, 0 for none.
+// The code that both sides support, 0 for none.
 uint32_t choose_common_method(uint32_t local, uint32_t offered, uint32_t preferred) {
-    if (local > WCCP_METHOD_EITHER)
+    if (local > WCCP_METHOD_EITHER) // not a valid configuration
         return WCCP_METHOD_NONE;
     const uint32_t common = local & get_offered_method(offered);
     return common == WCCP_METHOD_EITHER ? preferred : common;
@@ -126,8 +122,10 @@ int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,
                                      uint32_t *out_compatible) {
     *out_compatible = 0;
     *out_agreed = {};
+    // The return method is not configurable.
     const capabilities configured = {group->cfg_fwd_method, group->cfg_assign_method, WCCP_METHOD_EITHER};
     const capabilities in_force = {group->fwd_method, group->assign_method, group->ret_method};
+    // Once the first router has decided, the configuration no longer matters.
     const capabilities *local = group->state_flags & WCCP_CAPABILITIES_SET ? &in_force : &configured;
     capabilities agreed = {};
     for (const capability_step &step : capability_steps) {
@@ -172,7 +170,7 @@ wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 
     uint32_t flags = WCCP_RTR_ONE_WAY;
     if (agreed->forwarding == WCCP_METHOD_GRE || agreed->ret == WCCP_METHOD_GRE) {
         if (wccp_add_tunnel(group->id, group->appliance_ipa, router_id))
-            return nullptr;
+            return nullptr; // the router's next I-See-You tries again
         flags |= WCCP_RTR_HAS_TUNNEL;
     }
     wccp_sending_router *router = made.take();
@@ -199,9 +197,9 @@ wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 
     return router;
 }
 
-// Inactivity.
-
 namespace {
+
+// --- Timeouts
 
 void drop_view_references(wccp_service_group *group, wccp_sending_router *router) {
     for (uint32_t i = 0; i < router->view_router_count; i++)
@@ -213,20 +211,20 @@ void drop_view_references(wccp_service_group *group, wccp_sending_router *router
 }
 
 void remove_silent_router(wccp_service_group *group, wccp_sending_router *router) {
-    list_unlink(router);
+    list_unlink(router); // so that the functions below do not find it; sending_router_count still counts it
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removing router (router id: %s) due to inactivity.", group->id,
            addr_text(router->router_id).s);
     drop_view_references(group, router);
     if (router->flags & WCCP_RTR_HAS_TUNNEL)
         wccp_del_tunnel(group->id, group->appliance_ipa, router->router_id, 0);
-    if (group->sending_router_count == 1) {
+    if (group->sending_router_count == 1) { // it was the last one: the next router decides anew
         group->fwd_method = WCCP_METHOD_NONE;
         group->assign_method = WCCP_ASSIGN_NONE;
         group->ret_method = WCCP_METHOD_NONE;
         wccp_appliance_state_init(group);
         group->state_flags &= ~WCCP_CAPABILITIES_SET;
     }
-    if (router->self_buckets != 0) {
+    if (router->self_buckets != 0) { // it redirected to this appliance
         if (group->redirecting_routers != 0)
             group->redirecting_routers--;
         if (group->redirecting_routers == 0)
@@ -246,7 +244,7 @@ int wccp_monitor_sending_routers(wccp_service_group *group) {
         next = router->next;
         if (wccp_g.seconds - router->last_icu_time < ROUTER_HOLD_SECONDS)
             continue;
-        const be32 id = router->router_id;
+        const be32 id = router->router_id; // the record is freed
         remove_silent_router(group, router);
         wccp_alarm_raise_router_down_alarm(group);
         group->routers_timed_out++;
@@ -256,7 +254,7 @@ int wccp_monitor_sending_routers(wccp_service_group *group) {
     return 0;
 }
 
-// Removal Queries.
+// --- Removal Queries
 
 namespace {
 
@@ -287,7 +285,7 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
                          wccp_reason_value("a query of a one-way router"), {});
         return 0;
     }
-    router->receive_id = receive_id;
+    router->receive_id = receive_id; // echoed by the reply
     if (count_waiting_replies(group, router_id) >= MAX_REPLIES_WAITING) {
         QV_LOG(LC_LOG_INFO,
                "WCCP GRP %d: removal query request. maximum of waiting replies (%d) reached. (router id %s)",
@@ -307,7 +305,7 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
     }
     wccp_pkt *pkt = &reply.pointer->pkt;
     pkt->cursor = pkt->data;
-    pkt->ipa = router_id;
+    pkt->ipa = router_id; // only the querying router gets the reply
     if (const int status = wccp_pkt_build_here_i_am(group, pkt)) {
         QV_LOG(LC_LOG_INFO,
                "WCCP GRP %d: removal query request reply failed: building HERE_I_AM failed. (router id %s)",
@@ -326,7 +324,7 @@ int wccp_send_router_removal_query_reply(wccp_service_group *group) {
         next = reply->next;
         if (wccp_transmit_packet(group, &reply->pkt, WCCP_REMOVAL_REPLY))
             QV_LOG(LC_LOG_ERR, "WCCP GRP %u: %s failed.", group->id, "sending Query Response HERE_I_AM ");
-        if (--reply->tx_left == 0) {
+        if (--reply->tx_left == 0) { // failed transmissions count as well
             list_unlink(reply);
             group->removal_reply_count--;
             wccp_free(reply);
@@ -335,7 +333,7 @@ int wccp_send_router_removal_query_reply(wccp_service_group *group) {
     return 0;
 }
 
-// Questions about the routers.
+// --- Queries about the routers
 
 namespace {
 

@@ -13,7 +13,7 @@ void wccp_count_slots_by_owner(wccp_service_group *group, uint8_t *out_index) {
     wccp_dsg_appliance *owner = nullptr;
     for (uint32_t slot = 0; slot < group->bucket_count; slot++) {
         const be32 address = group->bucket_ipa[slot];
-        if (slot == 0 || !(address == group->bucket_ipa[slot - 1])) // slots come in runs
+        if (slot == 0 || !(address == group->bucket_ipa[slot - 1])) // an appliance's slots are consecutive
             owner = wccp_find_dsg_appliance(group, group->dsg_active_count, address);
         if (!owner)
             continue;

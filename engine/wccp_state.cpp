@@ -1,18 +1,18 @@
-// The heartbeat of a group: what is due in a tick, the election of the designated appliance, and the state
-// (INIT, ACTIVE, BACKUP) with its role.
+// The timers of a group, the election of the designated appliance, and the state of this appliance with its
+// role.
 //
-// Once a second the timer thread calls wccp_process_timers for each enabled group, under the engine lock that
-// it holds for the whole tick; the only clock is that tick. The table of steps below lists what a tick does,
-// in order. A step that fails is logged and the next one runs: a message that could not be sent is sent again
-// after its period, and an election that selected no appliance waits for the next change of a view.
+// The timer thread calls wccp_process_timers once a second for each enabled group and holds the engine lock
+// for the whole tick. There is no other clock. The table of steps at the end lists what a tick does, in
+// order. A step that fails is logged and the next one runs: a message that could not be sent is sent again
+// after its period, and an election that selected nobody waits for the next change of a view.
 //
-// The election exchanges nothing. Each appliance applies the same rule to the same view: the lowest address
-// is designated, provided that every router that any router reports is two-way connected. An appliance may be
-// designated without being ACTIVE, and the other way round.
+// The election exchanges no messages. Every appliance applies the same rule to the same views: the appliance
+// with the lowest address is designated, provided that every router that any router reports is two-way
+// connected. Being designated and being ACTIVE are independent of each other.
 //
-// The state functions run on the tick or on a receive thread. Each entry into a state passes the role on to
-// the policy groups and sends a state event, even when the role is the same as before. Once the exit has
-// begun the role still changes, but no event is sent.
+// The state functions run in a tick or on a receive thread. Each entry into a state passes its role on to the
+// policy groups and sends a state event, even if the role has not changed. During the exit the role is still
+// passed on, but no event is sent.
 #include "engine/wccp_state.h"
 
 #include <cstdio>
@@ -31,19 +31,20 @@
 
 namespace {
 
-constexpr uint32_t ASSIGN_PERIOD = 10;         // seconds
-constexpr uint32_t ASSIGN_DELAY_ELECTION = 16; // for the routers' views to settle
+// Seconds.
+constexpr uint32_t ASSIGN_PERIOD = 10;
+constexpr uint32_t ASSIGN_DELAY_ELECTION = 16; // until the routers' views have settled
 constexpr uint32_t ASSIGN_DELAY_WEIGHT_CHANGE = 1;
-constexpr uint32_t LEFT_OUT_LOG_PERIOD = 60; // seconds
+constexpr uint32_t LEFT_OUT_LOG_PERIOD = 60;
 
 } // namespace
 
-// The state.
+// --- The state
 
 int wccp_set_role_and_send_event(uint8_t id, uint32_t role) {
-    static const uint8_t event_code = 237;
+    static const uint8_t event_code = 237; // passed by reference to the platform's library
     const int result = wccp_set_role(id, role);
-    if (wccpd_shutdown_in_progress() == 1)
+    if (wccpd_shutdown_in_progress() == 1) // the alarm session is closed, or about to be
         return result;
     char text[8];
     snprintf(text, sizeof text, "%d", id);
@@ -65,13 +66,13 @@ int wccp_appliance_state_init(wccp_service_group *group) {
     if (group->state_flags & WCCP_STATE_INIT)
         return 0;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : INIT", group->id);
-    wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP);
+    wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP); // there is no role for INIT
     set_only_state(group, WCCP_STATE_INIT);
     return 0;
 }
 
 int wccp_appliance_state_active(wccp_service_group *group) {
-    if (group->state_flags & WCCP_STATE_ACTIVE)
+    if (group->state_flags & WCCP_STATE_ACTIVE) // unexpected, but the entry is carried out again
         QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: is already ACTIVE.", group->id);
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : ACTIVE", group->id);
     wccp_set_role_and_send_event(group->id, WCCP_ROLE_ACTIVE);
@@ -92,7 +93,7 @@ int wccp_appliance_state_backup(wccp_service_group *group) {
     return 0;
 }
 
-// The assignment that a designated appliance sends.
+// --- The assignment that the designated appliance sends
 
 void wccp_clear_redirect_assign_states(wccp_service_group *group) {
     group->assign_timer.active = 0;
@@ -106,8 +107,8 @@ void wccp_clear_redirect_assign_states(wccp_service_group *group) {
 
 namespace {
 
-// Adds the appliances that all routers list to the assignment. Gives how many are left out, and how many of
-// these have had their line in the log.
+// Adds the appliances that all routers list to the assignment. Outputs how many are left out, and how many of
+// these have been logged before.
 void collect_eligible_appliances(wccp_service_group *group, uint32_t *out_left_out, uint32_t *out_logged) {
     *out_left_out = *out_logged = 0;
     for (wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next) {
@@ -116,7 +117,7 @@ void collect_eligible_appliances(wccp_service_group *group, uint32_t *out_left_o
             wccp_designated_appliance_assignment_add(group, entry);
             continue;
         }
-        if (entry->listing == WCCP_LISTED_BY_ALL)
+        if (entry->listing == WCCP_LISTED_BY_ALL) // NOT_LISTED_LOGGED stays as it is
             entry->listing = WCCP_NOT_LISTED_BY_ALL;
         wccp_note_reason(group, WCCP_REASON_APPLIANCE_LEFT_OUT, entry->ipa,
                          wccp_reason_value("in %u views", entry->ref_count),
@@ -127,10 +128,11 @@ void collect_eligible_appliances(wccp_service_group *group, uint32_t *out_left_o
     wccp_forget_older_reasons(group, WCCP_REASON_APPLIANCE_LEFT_OUT);
 }
 
-// One I-See-You can bring 32 computations, and a thousand appliances can be left out of each. So an appliance
-// that is left out is logged once. When their set has changed all of it is logged again, but only once a
-// second, and when it has not, then after a minute.
+// One I-See-You can cause 32 computations, each of which can leave out a thousand appliances. Therefore an
+// appliance that is left out is logged once. All of them are logged again when their set changes, at most
+// once a second, and otherwise every minute.
 void log_appliances_left_out(wccp_service_group *group, uint32_t left_out, uint32_t logged) {
+    // The first test finds new appliances in the set, the second one those that have left it.
     const bool changed = logged != left_out || logged != group->not_listed_count;
     const uint32_t age = wccp_g.seconds - group->not_listed_time;
     const bool again = age >= LEFT_OUT_LOG_PERIOD || (changed && age != 0);
@@ -175,7 +177,7 @@ int wccp_update_designated_redirect_assignment(wccp_service_group *group, int re
         wccp_designated_appliance_assignment_cleanup(group);
         return 1;
     }
-    group->dsg_key_change++;
+    group->dsg_key_change++; // the routers report it when they have the new table
     group->pending_acks = static_cast<uint8_t>(group->sending_router_count & 0xff);
     for (wccp_sending_router *router = group->sending_routers; router; router = router->next) {
         router->flags |= WCCP_RTR_ASSIGN_UNACKED;
@@ -197,17 +199,18 @@ int wccp_update_designated_redirect_assignment(wccp_service_group *group, int re
     return 0;
 }
 
-// The election.
+// --- The election
 
 namespace {
 
 bool all_routers_are_two_way(wccp_service_group *group) {
     bool all = true;
+    // router_view also has the routers that other routers report and that have sent nothing themselves.
     for (const wccp_view_router *entry = group->router_view; entry; entry = entry->next) {
         const wccp_sending_router *router = wccp_find_sending_router(group, entry->ipa);
         if (router && router->flags & WCCP_RTR_TWO_WAY)
             continue;
-        all = false;
+        all = false; // go on, so that a reason is noted for each of them
         wccp_note_reason(group, WCCP_REASON_ELECTION_BLOCKED, entry->ipa,
                          wccp_reason_value("%s", router ? "one-way" : "no I-See-You"),
                          wccp_reason_value("two-way"));
@@ -217,7 +220,7 @@ bool all_routers_are_two_way(wccp_service_group *group) {
 }
 
 bool has_lower_appliance(const wccp_service_group *group) {
-    const uint32_t own = to_host(group->appliance_ipa);
+    const uint32_t own = to_host(group->appliance_ipa); // compared as numbers, therefore in host order
     for (const wccp_view_appliance *entry = group->appliance_view; entry; entry = entry->next)
         if (to_host(entry->ipa) < own)
             return true;
@@ -228,7 +231,7 @@ int wccp_elect_designated_appliance(wccp_service_group *group) {
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: new designated selection.", group->id);
     group->state_flags &= ~WCCP_DESG_ELECT_PENDING;
     const uint32_t was_designated = group->designated;
-    group->designated = 0;
+    group->designated = 0; // until this election has selected this appliance again
     wccp_forget_reasons(group, WCCP_REASON_APPLIANCE_LEFT_OUT);
     wccp_clear_redirect_assign_states(group);
     wccp_alarm_schedule_verify_allocation_table_timer(group, 1);
@@ -248,16 +251,17 @@ int wccp_elect_designated_appliance(wccp_service_group *group) {
     group->designated = 1;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: DSG SELECTED (%s) dsg key : 0x%x", group->id,
            addr_text(group->appliance_ipa).s, group->dsg_key_change);
-    if (was_designated == 0)
+    if (was_designated == 0) // key numbers start again at 1
         wccp_clear_assignment_block(group);
+    // Without an appliance to redirect to it stays designated and waits for the next change of a view.
     wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_ELECTION);
     return 0;
 }
 
-// The tick.
+// --- The tick
 
-// A step is due when its timer fires, or without a timer when `pending` says so. A null `words` is a step
-// that can't fail.
+// A step is due when its timer expires, or if it has no timer, when `pending` returns true. `words` is the
+// log line's name of the step; null for a step that cannot fail.
 struct tick_step {
     wccp_timer wccp_service_group::*timer;
     bool (*pending)(const wccp_service_group *group);
@@ -292,7 +296,7 @@ bool count_down_timer(wccp_timer *timer) {
         return false;
     }
     timer->countdown = timer->period;
-    if (timer->mode == WCCP_TIMER_COUNTS) {
+    if (timer->mode == WCCP_TIMER_COUNTS) { // the last expiry runs the action, too
         if (timer->remaining != 0)
             timer->remaining--;
         if (timer->remaining == 0)

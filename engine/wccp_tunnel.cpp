@@ -1,13 +1,16 @@
 // The process-wide table of GRE tunnels.
 //
-// One record for each pair of this appliance's address and a router's id; service groups that share the pair
-// share the tunnel and are counted in `ref_count`. The table hands out tunnel ids from a range of 32, one for
-// each bit of a bitmap: a clear bit means that a record holds the id or that an add for it is under way.
-// Commands to tunneld go through the mailbox (wccpd_common.cpp), which waits for the answer.
+// Each record stands for one pair of this appliance's address and a router's id. Service groups with the same
+// pair share the tunnel and are counted in `ref_count`. Tunnel ids come from a range of 32; a clear bit in
+// tunnel_free_ids means that a record has the id or an add for it is in progress. Commands to tunneld go
+// through the mailbox (wccpd_common.cpp), which waits for the answer.
 //
-// The tunnel mutex covers the list and the bitmap. It is taken after the engine lock and before the mailbox's
-// own. An add releases it while it waits for tunneld; a delete and a restore hold it through the wait. Two
-// adds for one new key are kept apart by the engine lock, which every caller of wccp_add_tunnel holds.
+// The tunnel mutex guards the list and the bitmap. It is taken after the engine lock and before the mailbox's
+// mutex. An add releases it while it waits for tunneld; a delete and a restore hold it. Two adds for the same
+// new key exclude each other by the engine lock, which all callers of wccp_add_tunnel hold.
+//
+// Callers are the receive threads (add), the timer thread (delete, when a router times out), whichever thread
+// stops a group (delete), and the main thread at exit (delete all, without the engine lock).
 
 #include "engine/wccp_tunnel.h"
 
@@ -49,7 +52,7 @@ void release_tunnel_id(uint32_t id) {
         tunnel_free_ids |= 1u << (id - g_qv_encap_wccp_first);
 }
 
-// The id of an add that is under way. Given back unless the record that holds it made it into the table.
+// The id of an add that is in progress. It is released unless the add has succeeded and cleared `taken`.
 struct owned_tunnel_id {
     ~owned_tunnel_id() {
         if (taken) {
@@ -63,7 +66,7 @@ struct owned_tunnel_id {
             return false;
         const uint32_t bit = static_cast<uint32_t>(__builtin_ctz(tunnel_free_ids));
         id = static_cast<uint16_t>(g_qv_encap_wccp_first + bit);
-        if (id == 65535)
+        if (id == 65535) // not a valid id
             return false;
         tunnel_free_ids &= ~(1u << bit);
         taken = true;
@@ -73,7 +76,7 @@ struct owned_tunnel_id {
     bool taken = false;
 };
 
-// Takes a record out of the table at the end of the scope, however that comes. tunnel_mutex held.
+// Takes a record out of the table at the end of the scope. tunnel_mutex held.
 struct tunnel_removal {
     explicit tunnel_removal(wccp_tunnel *removed) : tunnel(removed) {}
     ~tunnel_removal() {
@@ -86,7 +89,7 @@ struct tunnel_removal {
     wccp_tunnel *tunnel;
 };
 
-// Of an add for the router of a group. Engine lock held.
+// Notes why an add for a router failed. Engine lock held.
 void note_tunnel_failure(int group, wccp_reason_code code, be32 remote, const wccp_reason_text &offered,
                          const wccp_reason_text &wanted) {
     if (wccp_service_group *record = wccp_find_group(group))
@@ -143,15 +146,15 @@ int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
 
 int wccp_del_tunnel(uint32_t group_id, be32 local, be32 remote, int force) {
     char group[16] = " ";
-    if (group_id & 0xff)
+    if (group_id & 0xff) // 0: not on behalf of a group
         snprintf(group, sizeof group, " GRP %d", static_cast<int>(group_id & 0xff));
     const mutex_guard guard(&tunnel_mutex);
     wccp_tunnel *tunnel = find_tunnel(local, remote);
     if (!tunnel)
         return 0;
-    if (!force && tunnel->ref_count.fetch_sub(1) > 1)
+    if (!force && tunnel->ref_count.fetch_sub(1) > 1) // others still use it
         return 0;
-    const tunnel_removal removal(tunnel);
+    const tunnel_removal removal(tunnel); // after the log lines, which still use the record
     const int result = wccp_del_tunnel_encap(tunnel->tunnel_id, to_mailbox_address(local),
                                              to_mailbox_address(remote), &tunnel->dataplane_index);
     if (result != 1) {
@@ -159,15 +162,15 @@ int wccp_del_tunnel(uint32_t group_id, be32 local, be32 remote, int force) {
                addr_text(local).s, addr_text(remote).s);
         return 0;
     }
-    if (wccpd_exiting.load() == 1)
+    if (wccpd_exiting.load() == 1) // tunneld may be ending as well: not worth a warning
         return 0;
     QV_LOG(LC_LOG_WARNING, "WCCP%s: failed to delete GRE tunnel id: %d %s <=> %s", group, tunnel->tunnel_id,
            addr_text(local).s, addr_text(remote).s);
     return 1;
 }
 
-// The mutex is free between two deletes. Therefore the walk goes by the head of the list: each delete takes
-// that record out, and no pointer is kept that another thread could free meanwhile.
+// The mutex is released between two deletes, so no pointer into the list may be kept. Each delete removes the
+// head.
 int wccp_del_all_tunnels() {
     for (;;) {
         be32 local, remote;

@@ -1,12 +1,13 @@
-// Small things that the whole engine shares, and the engine lock.
+// Helpers that the whole engine uses, and the engine lock.
 //
 // The engine lock is taken by the timer thread for a tick, by a receive thread for a packet, by the main
-// thread for each call of configuration and monitoring, and by the platform's notifier for a callback.
-// Waiting for a mutex is not a cancellation point: a receive thread that waits while the engine is stopped
-// gets the lock afterwards, with its cancellation still pending. It would then add routers to groups that
-// have been stopped, and send commands to tunneld. Whoever takes the lock therefore first acts on a pending
-// cancellation; the thread ends there, a guard releases the lock, and nothing has been touched. The main
-// thread and the notifier are never cancelled.
+// thread for each call of configuration and monitoring, and by the notifier thread for a callback.
+//
+// Waiting for a mutex is not a cancellation point. A receive thread that waits for the lock while the groups
+// are stopped gets it afterwards with its cancellation still pending; if it went on, it would add routers to
+// stopped groups and send commands to tunneld. The constructor of the guard therefore calls
+// pthread_testcancel, which ends such a thread before it has touched anything. The main thread and the
+// notifier are never cancelled.
 
 #include "engine/wccp_utils.h"
 
@@ -19,7 +20,7 @@
 #include "runtime/guards.h"
 
 wccp_engine_lock::wccp_engine_lock() {
-    // The object is not complete yet: if the thread ends here, this guard releases the lock.
+    // Until the constructor returns, the destructor does not run; this guard then releases the lock.
     mutex_guard guard(&wccp_g.lock);
     pthread_testcancel();
     guard.held = nullptr;
@@ -66,7 +67,7 @@ bool wccp_if_is_ready(const wccp_interface *interface) {
     return interface && (interface->ready_flags & WCCP_ALL_READY) == WCCP_ALL_READY;
 }
 
-// The Here-I-Am timer runs from the start of a group to its stop.
+// hia_timer is active exactly from the start of a group to its stop.
 bool wccp_group_is_running(const wccp_service_group *group) {
     return group->hia_timer.active == 1 && wccp_if_is_ready(group->interfaces[0]);
 }

@@ -1,24 +1,24 @@
 // Views: which routers and appliances the routers of a group report, and what they assign to this appliance.
 //
-// There are two levels. Each sending router keeps its last report as arrays (view_routers, view_appliances).
-// The group keeps the union over all of them as lists (router_view, appliance_view), in which the reference
-// count of an entry is the number of sending routers that report it. A new report is compared with the
-// router's last one: what is new takes a reference in the union, what is gone gives its reference back, and
-// any such change raises the change number and asks for an election at the next tick. The first reference
-// creates an entry, the last one frees it, and nobody keeps a pointer to an entry.
+// There are two levels. Each sending router keeps its last report in arrays (view_routers, view_appliances).
+// The group keeps the union over all its routers in lists (router_view, appliance_view); the reference count
+// of an entry is the number of sending routers that report it. A new report is compared with the router's
+// last one: an address that is new takes a reference in the union, one that is missing drops its reference.
+// Either raises the change number and requests an election at the next tick. The first reference creates an
+// entry, the last one frees it; nobody else keeps pointers to entries. A change of weight alone only makes
+// the designated appliance compute its table again.
 //
-// An array holds exactly those addresses for which its router has a reference. Otherwise a reference would
-// outlive its router, and an appliance that nobody reports any more could keep the group from ever electing a
-// designated appliance. Therefore an address that occurs again in the same report is skipped, and a report is
-// always taken to its end: an address for which there was no memory stays out of the array, so that the next
-// report finds it new and tries again. A failure on the way is returned at the end.
+// Invariant: a router's array has exactly the addresses on which that router holds a reference. Otherwise a
+// reference could be left over when the router is removed, and an appliance that nobody reports any more
+// would block every later election. Therefore a repeated address in a report is skipped, and a failure does
+// not end an update: an address that there was no memory for stays out of both, the rest is applied, and the
+// failure is returned at the end. The next report adds the missing address.
 //
-// The engine lock is held throughout, by a receive thread, or by the timer thread when a silent router is
-// removed. In steady state a report equals the one before it, entry by entry, and costs a comparison and a
-// copy. Otherwise an address is looked for at its old position first, then everywhere.
+// The engine lock is held throughout, by a receive thread, or by the timer thread when it removes a router
+// that has timed out. In steady state a report repeats the last one; this case is tested first and costs one
+// pass. Otherwise an address is looked for at its old position first, then everywhere.
 //
-// The role of this appliance follows from what one router assigned before and assigns now: take_redirection
-// at the end of this file.
+// The last section derives the role of this appliance from what a router assigned before and assigns now.
 #include "engine/wccp_view_utils.h"
 
 #include <cstring>
@@ -33,9 +33,9 @@
 
 namespace {
 
-constexpr uint32_t MARK = 1;
+constexpr uint32_t MARK = 1; // of an old entry that the new report has as well
 
-// The lists.
+// --- The unions
 
 template <typename Entry>
 Entry *find_view_entry(Entry *entry, be32 address) {
@@ -59,7 +59,7 @@ int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_app
         return 0;
     }
     list_insert_after(head, entry);
-    if (entry->weight == head->weight && entry->ipa == head->ipa) {
+    if (entry->weight == head->weight && entry->ipa == head->ipa) { // it is inserted nevertheless
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: adding appliance sorted failed. appliance %s", group->id,
                addr_text(entry->ipa).s);
         return 1;
@@ -69,8 +69,7 @@ int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_app
 
 namespace {
 
-// Gives one reference on an entry of a union back, and frees the entry with the last one. False when there is
-// no entry of that address.
+// False when there is no entry of that address.
 template <typename Entry>
 bool drop_reference(Entry *first, uint32_t *count, be32 address) {
     Entry *entry = find_view_entry(first, address);
@@ -113,7 +112,7 @@ void note_view_change(wccp_service_group *group, const wccp_sending_router *rout
            static_cast<int>(group->change_number));
 }
 
-// The reports.
+// --- Comparing a report with the last one
 
 be32 get_address(be32 address) {
     return address;
@@ -122,7 +121,7 @@ be32 get_address(const wccp_rtr_view_appliance &element) {
     return element.ipa;
 }
 
-// Bit i is set when no item of the report before item i has the same address.
+// Bit i of the result: no item before item i has the same address.
 template <typename Item>
 uint32_t find_first_occurrences(const Item *items, uint32_t count) {
     static_assert(WCCP_MAX_ROUTERS <= 32 && WCCP_MAX_APPLIANCES <= 32);
@@ -137,7 +136,7 @@ uint32_t find_first_occurrences(const Item *items, uint32_t count) {
     return bits;
 }
 
-// The entry of an address in the last report, or null. `place` is where the new report has it.
+// The entry of an address in the last report, or null. `place` is its index in the new report.
 template <typename Entry>
 Entry *find_reported_entry(Entry *entries, uint32_t count, uint32_t place, be32 address) {
     if (place < count && entries[place].ipa == address)
@@ -154,16 +153,16 @@ void clear_marks(Entry *old, uint32_t count) {
         old[i].flags &= ~MARK;
 }
 
-// What a comparison leaves when every address of the report is known. A dump shows the marks.
+// The marks that a comparison leaves when every address is known. They show in the diagnostic dump.
 template <typename Entry>
 void set_marks(Entry *old, uint32_t count) {
     for (uint32_t i = 0; i < count; i++)
         old[i].flags |= MARK;
 }
 
-// Routers.
+// --- The routers of a report
 
-// Takes a reference on the union's entry of a router. False when memory is out.
+// Adds a reference on the union's entry of a router. False when there is no memory for a new entry.
 bool add_router_reference(wccp_service_group *group, be32 address) {
     wccp_view_router *entry = find_view_entry(group->router_view, address);
     if (!entry) {
@@ -202,7 +201,7 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
         return 0;
     }
     const uint32_t old_count = router->view_router_count;
-    uint32_t taken = find_first_occurrences(addresses, count);
+    uint32_t taken = find_first_occurrences(addresses, count); // bit i: entry i is part of the new report
     bool changed = false;
     int status = 0;
     clear_marks(router->view_routers, old_count);
@@ -214,7 +213,7 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
             known->flags |= MARK;
         } else if (add_router_reference(group, addresses[i])) {
             changed = true;
-        } else {
+        } else { // left out of the report, so that the next one tries again
             taken &= ~(1u << i);
             status = 1;
         }
@@ -225,6 +224,7 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
         wccp_remove_router_from_view_list(group, router->view_routers[i].ipa);
         changed = true;
     }
+    // Only now may the old entries be overwritten.
     router->view_router_count = 0;
     for (uint32_t i = 0; i < count; i++)
         if (taken >> i & 1)
@@ -235,11 +235,11 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
     return status;
 }
 
-// Appliances.
+// --- The appliances of a report
 
 namespace {
 
-// A router reports another weight than it did before.
+// A router reports another weight than in its last report.
 int apply_reported_weight(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
     wccp_view_appliance *entry = find_view_entry(group->appliance_view, element->ipa);
     if (!entry) {
@@ -247,24 +247,25 @@ int apply_reported_weight(wccp_service_group *group, const wccp_rtr_view_applian
                group->id, addr_text(element->ipa).s);
         return 1;
     }
-    if (entry->weight == element->weight)
+    if (entry->weight == element->weight) // another router has reported the new weight before
         return 0;
     QV_LOG(LC_LOG_INFO,
            "WCCP GRP %d: appliance %s weight change detected (%d -> %d). triggering redirect assignment "
            "check.",
            group->id, addr_text(entry->ipa).s, entry->weight, element->weight);
-    list_unlink(entry);
+    list_unlink(entry); // its place depends on the weight
     entry->weight = element->weight;
     if (wccp_view_list_add_appliance_sorted(group, entry))
         return 1;
     if (group->designated != 1)
         return 0;
+    // A change of weight needs no election, only a new table.
     wccp_clear_redirect_assign_states(group);
     wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
     return wccp_update_designated_redirect_assignment(group, WCCP_ASSIGN_AFTER_WEIGHT_CHANGE) ? 1 : 0;
 }
 
-// Takes a reference on the union's entry of an appliance. False when memory is out.
+// Adds a reference on the union's entry of an appliance. False when there is no memory for a new entry.
 bool add_appliance_reference(wccp_service_group *group, const wccp_rtr_view_appliance *element) {
     wccp_view_appliance *entry = find_view_entry(group->appliance_view, element->ipa);
     if (!entry) {
@@ -279,7 +280,8 @@ bool add_appliance_reference(wccp_service_group *group, const wccp_rtr_view_appl
         entry->ipa = element->ipa;
         entry->weight = element->weight;
         group->appliance_view_count++;
-        (void)wccp_view_list_add_appliance_sorted(group, entry); // refuses only an address that is there
+        (void)wccp_view_list_add_appliance_sorted(group,
+                                                  entry); // fails only for an address that is in the list
     }
     entry->ref_count++;
     return true;
@@ -301,7 +303,7 @@ void set_one_way(wccp_service_group *group, wccp_sending_router *router) {
     wccp_alarm_raise_router_down_alarm(group);
 }
 
-// The same appliances with the same weights, in the same order: nothing moves but what is assigned to them.
+// The same appliances with the same weights in the same order. What is assigned to them may differ.
 bool repeats_last_report(const wccp_sending_router *router, uint32_t count,
                          const wccp_rtr_view_appliance *decoded) {
     if (count != router->view_appliance_count)
@@ -314,7 +316,7 @@ bool repeats_last_report(const wccp_sending_router *router, uint32_t count,
     return true;
 }
 
-// The elements whose bit is set in `taken` become the router's last report.
+// Stores the elements whose bit is set in `taken` as the router's last report.
 void store_appliance_report(wccp_sending_router *router, uint32_t count,
                             const wccp_rtr_view_appliance *decoded, uint32_t taken) {
     router->view_appliance_count = 0;
@@ -326,13 +328,13 @@ void store_appliance_report(wccp_sending_router *router, uint32_t count,
         entry->weight = decoded[i].weight;
         entry->buckets_assigned = decoded[i].buckets_assigned;
         entry->buckets_total = decoded[i].buckets_total;
-        if (decoded[i].buckets_assigned != 0)
+        if (decoded[i].buckets_assigned != 0) // otherwise the earlier bits stay
             memcpy(entry->bucket_bits, decoded[i].bucket_bits, sizeof entry->bucket_bits);
     }
 }
 
-// Moves the union and the connection by what is new in a report and what is gone. Gives back which elements
-// were taken, a bit for each, and whether the view has changed.
+// Updates the union, and the router's connection state, by what is new in a report and what is missing.
+// Outputs a bit for each element that was taken, and whether the view has changed.
 int apply_appliance_report(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                            const wccp_rtr_view_appliance *decoded, uint32_t *out_taken, bool *out_changed) {
     const uint32_t old_count = router->view_appliance_count;
@@ -404,11 +406,11 @@ int wccp_appliance_is_reported_by_all_senders(wccp_service_group *group, be32 ad
     return 1;
 }
 
-// The role.
+// --- The role
 
 namespace {
 
-// Enters a state for the reason that `line` gives, with the group's number and the router's id.
+// Logs `line`, a format for the group's id and the router's id, and enters a state.
 void enter_state(wccp_service_group *group, const wccp_sending_router *router, const char *line,
                  int (*enter)(wccp_service_group *)) {
     QV_LOG(LC_LOG_INFO, line, group->id, addr_text(router->router_id).s);
@@ -416,7 +418,7 @@ void enter_state(wccp_service_group *group, const wccp_sending_router *router, c
 }
 
 void handle_redirect_here(wccp_service_group *group, const wccp_sending_router *router) {
-    if (++group->redirecting_routers == 1)
+    if (++group->redirecting_routers == 1) // only the first router changes the state
         enter_state(group, router, "WCCP GRP %d: redirect: first router to self (router id %s )",
                     wccp_appliance_state_active);
 }
@@ -428,12 +430,12 @@ void handle_redirect_elsewhere(wccp_service_group *group, const wccp_sending_rou
                     wccp_appliance_state_backup);
 }
 
-// `elsewhere`: to other appliances, instead of to nobody.
+// `elsewhere`: it now redirects to other appliances. Otherwise it redirects to none.
 void handle_end_of_redirect_here(wccp_service_group *group, const wccp_sending_router *router,
                                  bool elsewhere) {
     if (group->redirecting_routers != 0)
         group->redirecting_routers--;
-    if (group->redirecting_routers != 0)
+    if (group->redirecting_routers != 0) // others still redirect here
         return;
     if (elsewhere)
         enter_state(group, router,
@@ -456,8 +458,8 @@ void handle_end_of_redirect_elsewhere(wccp_service_group *group, const wccp_send
                     wccp_appliance_state_init);
 }
 
-// The router already holds what it assigns now; the numbers are what it assigned before, to this appliance
-// and to anybody, and at least one of them differs.
+// The router's record has the new numbers. The arguments are the old ones, for this appliance and for all; at
+// least one of them differs from the new one.
 void apply_redirect_change(wccp_service_group *group, const wccp_sending_router *router, uint16_t self_before,
                            uint16_t total_before) {
     const bool here = router->self_buckets != 0, anywhere = router->total_buckets != 0;
@@ -478,7 +480,7 @@ void apply_redirect_change(wccp_service_group *group, const wccp_sending_router 
 int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sending_router *router,
                                           const wccp_assign_summary *hash, const wccp_assign_summary *mask) {
     const wccp_assign_summary *now = mask->valid == 1 ? mask : hash;
-    if (now->valid != 1) {
+    if (now->valid != 1) { // elements of mask assignment, but no Assignment Map
         WCCP_COMPLAIN(LC_LOG_WARNING,
                       "WCCP GRP %d: update redirect status: assign. info not found. sender rtr id: %s",
                       group->id, addr_text(router->router_id).s);

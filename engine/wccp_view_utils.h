@@ -1,29 +1,35 @@
-// Router and appliance views, per router and as a union, and the role that follows from what routers assign.
-// Lock held throughout.
+// The views of a group: what its routers report, each router's last report and the union over all routers,
+// and the role that follows from what the routers assign. Lock held throughout.
 #pragma once
 
 #include "engine/wccp_records.h"
 
 struct wccp_assign_summary;
 
-// Each takes a router's new report, `addresses` or `decoded` in its order and of `count` entries, and skips
-// an address that occurs again. 1 when something of it failed, for lack of memory or because a changed weight
-// left no appliance to redirect to; the rest of the report has been taken all the same. Nothing is taken of
-// more than 32 entries, which is also 1.
+// Both replace the router's last report by a new one of `count` entries, in its order, and update the union.
+// Of entries with the same address only the first counts.
+//
+// 0, or 1 when something failed. More than 32 entries: nothing has changed. Otherwise the whole report has
+// been applied except for the entries that there was no memory for; these are in neither the report nor the
+// union, so the next report adds them. A changed weight that leaves the designated appliance without anybody
+// to redirect to, and an appliance that is missing in the union, also give 1.
 int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                             const be32 *addresses);
 int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                                const wccp_rtr_view_appliance *decoded);
-// Works out the role from what the router now assigns; 1 when neither summary is valid.
+// Updates the role of this appliance from what the router assigns now: by `mask` if that is valid, otherwise
+// by `hash`. 1, with a line in the log, when neither is valid.
 int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sending_router *router,
                                           const wccp_assign_summary *hash, const wccp_assign_summary *mask);
-// Puts the entry at the head when it is above the head, by weight and then by address, else directly after
-// it. 1 when the head has the same weight and address.
+// Inserts an entry before the head of appliance_view if its weight, or with equal weights its address, is
+// higher, otherwise directly after the head; so only the head is in its sorted place. 1, with a line in the
+// log, when the head has the same weight and address.
 int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_appliance *entry);
-// Give one reference back, the last one with its entry; 1 when there is no entry of this address.
+// Both drop one reference on the union's entry and free it with the last one. 1, with a line in the log, when
+// the union has no such entry.
 int wccp_remove_router_from_view_list(wccp_service_group *group, be32 address);
 int wccp_remove_appliance_from_view_list(wccp_service_group *group, be32 address);
-// 1 or 0; 1 without sending routers.
+// 1 when the last reports of all sending routers have the address, also when there are none; otherwise 0.
 int wccp_appliance_is_reported_by_all_senders(wccp_service_group *group, be32 address);
-// The entry in the router's last report, or null.
+// The entry of an address in the router's last report, or null. It is valid until the next report.
 wccp_rtr_view_appliance *wccp_get_router_appliance_view_element(wccp_sending_router *router, be32 address);

@@ -1,6 +1,6 @@
-// WCCP version 2 on the wire, once: every message and component layout, for the writer and the reader alike.
-// All fields are big-endian and alignment is 1. A component starts with a 16-bit type and a 16-bit length
-// that counts the bytes after those four.
+// The WCCP version 2 wire format: the layout of every message and component, for the writer and the reader.
+// All fields are big-endian, and all layouts have alignment 1, because a component may begin at any offset. A
+// component starts with a 16-bit type and a 16-bit length; the length counts the bytes after these four.
 #pragma once
 
 #include <cstddef>
@@ -15,7 +15,7 @@ enum : uint32_t {
     WCCP_REDIRECT_ASSIGN = 12,
     WCCP_REMOVAL_QUERY = 13
 };
-// Not on the wire: the kind of packet that wccp_transmit_packet is given for a removal reply.
+// Not on the wire, where it is a Here-I-Am: the kind that wccp_transmit_packet takes for a removal reply.
 constexpr uint32_t WCCP_REMOVAL_REPLY = 25;
 enum : uint16_t {
     WCCP_SECURITY_INFO = 0,
@@ -44,7 +44,7 @@ struct wccp_wire_component {
     be16 type;
     be16 length;
 };
-struct wccp_wire_security_info { // 8 bytes, 24 with the digest
+struct wccp_wire_security_info { // option 0 none, 1 MD5, with which the digest follows
     wccp_wire_component head;
     be32 option;
 };
@@ -147,7 +147,7 @@ struct wccp_wire_router_view { // r addresses, a count, w web-cache elements fol
     be32 key_change;
     be32 routers;
 };
-// A web-cache element of a router view. Its flags decide which of the three it is.
+// The head of a web-cache element of a router view. Its flags decide which of the three forms follows.
 struct wccp_wire_view_element {
     be32 web_cache_id;
     be16 hash_revision;
@@ -159,13 +159,13 @@ struct wccp_wire_view_element_hash {
     be16 weight;
     be16 status;
 };
-struct wccp_wire_view_element_mask { // also the element of a web-cache without redirect, in both modes
+struct wccp_wire_view_element_mask { // Nexus mode; in both modes for a web-cache without redirection
     wccp_wire_view_element head;
     uint8_t unread[20];
     be16 weight;
     be16 status;
 };
-struct wccp_wire_view_element_mask_short {
+struct wccp_wire_view_element_mask_short { // IOS mode
     wccp_wire_view_element head;
     be32 unread;
     be16 weight;

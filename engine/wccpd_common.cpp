@@ -1,31 +1,30 @@
-// wccpd's side of the mailbox to tunneld.
+// wccpd's side of the mailbox to tunneld, a block of shared memory with one command slot.
 //
-// Only the process that created the block writes to it. A second wccpd, whose creation was refused, has no
-// mailbox: its commands fail at once, it publishes no role, and its exit resets nothing.
+// Only the process that created the block writes to it. If a second wccpd is started, its creation is refused
+// and it has no mailbox: its commands fail at once, it publishes no roles, and its exit resets nothing.
 //
-// One mutex, the last in the engine's order of locks, keeps commands apart: it is held from the first input
-// to the end of the wait. Therefore two commands never overlap, whichever of the engine's locks their callers
-// hold. `command` is set to 0 before an input is touched, because a delete or an L2 return that timed out is
-// still pending and tunneld may be reading it; it is written last, with release order, and the answer is
-// looked for with acquire order.
+// The mailbox mutex is the last in the engine's order of locks. It is held from the first input of a command
+// to the end of the wait for its answer, so that commands never overlap, whichever other locks their callers
+// hold. `command` is cleared before the inputs are written, because a delete or an L2 return that timed out
+// is still in the slot and tunneld may be reading it. It is written last, with release order; the answer is
+// read with acquire order.
 //
-// A command that has been written wakes tunneld by a datagram. The wait is a poll of one millisecond, two
-// thousand times. Between two polls, when there is no answer yet, it is a cancellation point: an answer that
-// has come is taken, and a thread that is cancelled before releases the mutex on its way out and withdraws an
-// add, as after a time-out, since nobody would know the tunnel that came of it.
+// A command that has been written wakes tunneld by a datagram. The wait polls the slot every millisecond, two
+// thousand times. An add without an answer is withdrawn, since nobody would know the tunnel; the other
+// commands stay in the slot. No thread is cancelled during a wait (wccp_mgr.cpp).
 //
 // Callers wait with the engine lock held, and a tunneld that hangs must not take down groups that need no
 // tunnel. After a time-out, therefore, adds and L2 returns fail at once as if they had timed out, for ten
-// seconds or until tunneld has cleared a command that stayed in the slot; then one is tried. The seconds are
-// the monotonic clock's: the engine's own stand still while a command is waited for. A delete is always
-// given, since nobody would repeat it, but it is not waited for after another that timed out. At exit nothing
-// is waited for after the first command that timed out.
+// seconds or until tunneld has cleared a command that stayed in the slot; then one is tried again. These
+// seconds are the monotonic clock's, because wccp_g.seconds does not advance while a tick waits. A delete is
+// always sent, since nobody repeats it, but not waited for if the command that timed out was a delete as
+// well. During the exit nothing is waited for after the first time-out.
 //
 // The reset at exit runs on the main thread while an engine thread may be waiting. It sets `abandon`, which
-// ends a wait at its next look with the result of a time-out, then waits for the mutex, and only then
-// clears the header: a waiter never sees a `command` that the reset has cleared. Commands after the reset
-// (the tunnels deleted at exit) are given as usual. The memberships are cleared before the roles: an engine
-// thread that still changes state then reaches no policy group, and tunneld sees UNKNOWN for all.
+// ends the wait at the next poll as a time-out, and resets the block once it has the mutex, so that no waiter
+// takes the cleared `command` for an answer. Later commands, for the tunnels that are deleted at exit, work
+// as usual. Memberships are cleared before the roles are reset, so that an engine thread that still changes a
+// role reaches no policy group and tunneld sees UNKNOWN for all of them.
 
 #include "engine/wccpd_common.h"
 
@@ -47,12 +46,12 @@ pthread_mutex_t mailbox_mutex = PTHREAD_MUTEX_INITIALIZER;
 std::atomic<bool> abandon;
 wccp_tunnel_mailbox *created_mailbox; // null until this process has created the block
 
-constexpr int ANSWER_POLLS = 2000;        // of a millisecond
-constexpr int64_t RETRY_AFTER_MS = 10000; // until a tunneld that was silent is tried again
+constexpr int ANSWER_POLLS = 2000;        // one every millisecond
+constexpr int64_t RETRY_AFTER_MS = 10000; // after a time-out
 
-// The last command that timed out, until tunneld answers another.
+// The last command that timed out, until tunneld answers a later one.
 struct unanswered_command {
-    uint16_t code; // MAILBOX_IDLE: there is none
+    uint16_t code; // MAILBOX_IDLE: none
     bool during_exit;
     int64_t since_ms;
 };
@@ -109,7 +108,7 @@ int wccp_cleanup_shmem() {
     wccp_tunnel_mailbox *mailbox = mailbox_get(created_mailbox);
     if (!mailbox)
         return 0;
-    wccp_init_policy_grp_mgr();
+    wccp_init_policy_grp_mgr(); // before the roles are reset, see above
     abandon.store(true, std::memory_order_release);
     const mutex_guard guard(&mailbox_mutex);
     reset_mailbox(mailbox, 0);
@@ -126,7 +125,7 @@ struct mailbox_inputs {
     uint32_t l2_value;
 };
 
-// Each command, and the line that reports its time-out.
+// A command, with the log line for its time-out.
 struct command_kind {
     uint16_t code;
     int32_t time_out_level;
@@ -138,16 +137,18 @@ const command_kind set_l2_return = {MAILBOX_L2_RETURN, LC_LOG_ERR, "GRE tunnel L
 
 enum class effort { NONE, GIVE, GIVE_AND_WAIT };
 
-// What is done about a command. mailbox_mutex held.
+// How a command is handled: not sent, sent, or sent and waited for. mailbox_mutex held.
 effort choose_effort(uint16_t code, const wccp_tunnel_mailbox *mailbox) {
     const bool exiting = wccpd_shutdown_in_progress() == 1;
+    // A time-out before the exit does not count during the exit: one more command is waited for.
     if (unanswered.code == MAILBOX_IDLE || (exiting && !unanswered.during_exit))
         return effort::GIVE_AND_WAIT;
+    // A withdrawn add leaves the slot clear whether or not tunneld is working.
     const bool cleared = unanswered.code != MAILBOX_ADD_TUNNEL &&
                          mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE;
     if (!exiting && (cleared || lt_monotonic_ms() - unanswered.since_ms >= RETRY_AFTER_MS))
         return effort::GIVE_AND_WAIT;
-    if (code != MAILBOX_DELETE_TUNNEL)
+    if (code != MAILBOX_DELETE_TUNNEL) // its caller tries again later
         return effort::NONE;
     return exiting || unanswered.code == MAILBOX_DELETE_TUNNEL ? effort::GIVE : effort::GIVE_AND_WAIT;
 }
@@ -183,8 +184,8 @@ wait_end wait_for_answer(wccp_tunnel_mailbox *mailbox, uint16_t code) {
     return end;
 }
 
-// Gives the command and waits, unless it is refused. True when tunneld has answered; its answer is then in
-// the outputs. Otherwise `out_failure` says why not.
+// Sends the command and waits, as choose_effort decides. True when tunneld has answered, with its answer in
+// the outputs; otherwise `out_failure` is the reason.
 bool run_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_t *out_status,
                  uint32_t *out_index, wccp_reason_code *out_failure) {
     const mutex_guard guard(&mailbox_mutex);
@@ -202,11 +203,11 @@ bool run_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_
         if (end == wait_end::TIMED_OUT)
             unanswered = {kind->code, wccpd_shutdown_in_progress() == 1, lt_monotonic_ms()};
     }
-    if (end == wait_end::TIMED_OUT)
+    if (end == wait_end::TIMED_OUT) // also for a command that was not sent, but not at the reset
         WCCP_COMPLAIN(kind->time_out_level, "%s", kind->time_out_line);
     if (end != wait_end::ANSWERED)
         return false;
-    unanswered = {};
+    unanswered = {}; // tunneld works again
     *out_status = mailbox_get(mailbox->status);
     *out_index = mailbox_get(mailbox->fmst_index);
     return true;
@@ -236,7 +237,7 @@ int wccp_add_tunnel_or_say_why(uint16_t tunnel_id, mailbox_address local, mailbo
     uint32_t status, index;
     if (!run_command(&add_tunnel, &inputs, &status, &index, out_failure))
         return 1;
-    *out_failure = WCCP_REASON_TUNNEL_REFUSED; // if it is one
+    *out_failure = WCCP_REASON_TUNNEL_REFUSED; // the only failure that an answer can report
     *inout_index = index;
     return index == WCCP_NO_INDEX ? 1 : static_cast<int>(status);
 }

@@ -1,10 +1,13 @@
-// The policy groups: which service groups belong to each, and the role that this gives it.
+// Policy groups: which service groups belong to each, and the role that follows from theirs.
 //
-// One small mutex, the last in the engine's order of locks, keeps the management thread, which changes
-// memberships, apart from the engine's threads, which change roles. A table of 65536 bit sets would be 2 MB
-// of locked memory for what is at most a few hundred memberships. Therefore `policy_grp_members` holds only
-// the sets that are not empty, in no order, and grows when it needs one more. When it cannot grow, the
-// membership is refused, the caller is informed, and the table stays as it was.
+// The policy mutex separates the main thread, which changes memberships, from the engine's threads, which
+// change roles with the engine lock held. It is taken after the engine lock and covers the publication of a
+// role.
+//
+// A table of bit sets for all 65536 policy groups would take 2 MB of locked memory for a few hundred
+// memberships at most. Therefore `policy_grp_members` holds only the sets that are not empty, unsorted, and
+// grows when one more is needed. When it cannot grow, the membership is refused and the table stays as it
+// was.
 
 #include "engine/wccpd_common.h"
 
@@ -21,7 +24,7 @@ namespace {
 
 constexpr uint32_t SERVICE_GROUPS = 256;
 
-struct policy_grp_set { // one policy group with members
+struct policy_grp_set { // a policy group that has members
     uint16_t policy;
     uint8_t bits[SERVICE_GROUPS / 8]; // service group s is bit s % 8 of byte s / 8
 };
@@ -37,7 +40,7 @@ constexpr service_roles make_unknown_roles() {
 }
 
 pthread_mutex_t policy_mutex = PTHREAD_MUTEX_INITIALIZER;
-// All below: policy_mutex.
+// Guarded by policy_mutex, which all functions below expect to be held.
 service_roles svc_role = make_unknown_roles();
 uint16_t svc_policy_grp[SERVICE_GROUPS]; // 0 for none
 policy_grp_set *policy_grp_members;
@@ -60,7 +63,7 @@ policy_grp_set *find_or_add_member_set(uint16_t policy) {
     if (policy_grp_count == policy_grp_room) {
         const uint32_t room = policy_grp_room ? policy_grp_room * 2 : 16;
         void *grown = realloc(policy_grp_members, room * sizeof(policy_grp_set));
-        if (!grown)
+        if (!grown) // the old array is still valid
             return nullptr;
         policy_grp_members = static_cast<policy_grp_set *>(grown);
         policy_grp_room = room;
@@ -72,7 +75,7 @@ policy_grp_set *find_or_add_member_set(uint16_t policy) {
 }
 
 void remove_member_set(policy_grp_set *set) {
-    *set = policy_grp_members[--policy_grp_count];
+    *set = policy_grp_members[--policy_grp_count]; // the order does not matter
 }
 
 void remove_member(uint16_t policy, uint8_t id) {
@@ -86,7 +89,7 @@ void remove_member(uint16_t policy, uint8_t id) {
     remove_member_set(set);
 }
 
-// The role that the members give a policy group: a member whose role is unknown counts like a backup.
+// A member whose role is UNKNOWN counts like one in BACKUP.
 uint32_t derive_policy_role(const policy_grp_set *set) {
     if (!set)
         return WCCP_ROLE_UNKNOWN;
@@ -129,7 +132,7 @@ int wccp_add_policy_grp(uint16_t policy, uint32_t count, const uint8_t *ids) {
             continue;
         }
         set->bits[id / 8] = static_cast<uint8_t>(set->bits[id / 8] | (1u << (id % 8)));
-        svc_policy_grp[id] = policy;
+        svc_policy_grp[id] = policy; // the bit in an earlier policy group stays
         QV_LOG(LC_LOG_DEBUG, "WCCP: Add Service group %d to Policy group %d", id, policy);
     }
     update_policy_role(policy);
