@@ -23,7 +23,7 @@
 #include "runtime/md5.h"
 #include "tests/support/log_daemon.h"
 #include "tests/support/reported_group.h"
-#include "tests/support/wire_bytes.h"
+#include "tests/support/router_messages.h"
 
 namespace {
 
@@ -78,21 +78,17 @@ struct full_group {
     reported_appliances appliances;
 };
 
-// The I-See-You of the last router, with the hash buckets of 32 appliances, 10.0.<third>.1 and following.
+// The I-See-You of the last router, with the hash buckets of 32 appliances, 10.0.<third>.1 and so on.
 std::vector<uint8_t> make_i_see_you(bool digested, uint32_t third, uint32_t weight) {
-    wire_bytes security =
-        wire_bytes().u16(0).u16(digested ? 20 : 4).u32(digested ? 1 : 0).zeros(digested ? 16 : 0);
-    wire_bytes service = wire_bytes().u16(1).u16(24).u8(1).u8(51).zeros(22);
-    wire_bytes identity = wire_bytes().u16(2).u16(20).ip(0, 232).u32(1).ip(0, 1).u32(1).ip(0, 1);
-    wire_bytes view = wire_bytes().u16(4).u16(20 + 32 * 4 + 32 * 44).u32(1).ip(0, 1).u32(1).u32(32);
-    for (uint32_t i = 0; i < 32; i++)
-        view.ip(0, 201 + i);
-    view.u32(32);
-    for (uint32_t i = 0; i < 32; i++)
-        view.ip(i == 0 ? 0 : third, 1 + i).u32(0).zeros(i).u8(0xff).zeros(31 - i).u16(weight).u16(0);
-    wire_bytes capabilities =
-        wire_bytes().u16(8).u16(24).hex("0001000400000002 0002000400000001 0003000400000002");
-    return wire_message(11, {security, service, identity, view, capabilities});
+    std::vector<be32> routers;
+    std::vector<hash_element> elements;
+    for (uint32_t i = 0; i < 32; i++) {
+        routers.push_back(host(201 + i));
+        elements.push_back({host((i == 0 ? 0 : third) << 8 | (1 + i)), weight,
+                            wire_bytes().zeros(i).u8(0xff).zeros(31 - i)});
+    }
+    return wire_message(11, {security_info(digested), service_info(51), router_identity(host(232), US, 1),
+                             router_view(routers, elements, US, 1), capability_info(2, 1, 2)});
 }
 
 std::unique_ptr<wccp_pkt> make_packet(const std::vector<uint8_t> &message) {

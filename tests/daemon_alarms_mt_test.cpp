@@ -1,5 +1,5 @@
-// Alarms and state events on their own session, raised by engine threads while the session opens, works, is
-// lost or shut down, and is freed. Each session has a process of its own: a client that has ended stays so.
+// Alarms and state events, sent by engine threads while their session is opened, used, lost or shut down, and
+// freed. Each session has a process of its own, because the client cannot be started again.
 #include <atomic>
 #include <csignal>
 #include <map>
@@ -23,18 +23,18 @@ namespace {
 
 constexpr uint8_t FIRST_GROUP = 51, GROUPS = 3;
 
-// Everything that can happen to a group's alarms, in one hold of the engine lock.
-void raise_and_clear(wccp_service_group *group) {
+// All changes of a group's alarms, in one hold of the engine lock.
+void raise_and_clear_alarms(wccp_service_group *group) {
     const wccp_engine_lock lock;
     wccp_alarm_raise_router_down_alarm(group);
-    wccp_alarms_verify_allocation_table(group); // its router redirects to nobody
+    wccp_alarms_verify_allocation_table(group); // its router redirects to no appliance
     wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP);
     wccp_alarms_clear_all_raised_alarms(group);
 }
 
 void *engine_thread(void *group) {
     for (;;) {
-        raise_and_clear(static_cast<wccp_service_group *>(group));
+        raise_and_clear_alarms(static_cast<wccp_service_group *>(group));
         usleep(100);
     }
 }
@@ -60,8 +60,7 @@ std::string text_of_event(const wire &frame) {
     return text;
 }
 
-// How often each event came, until the client closes or, for a session that is lost, until all have come
-// often.
+// Counts the events, until the client closes or, if the session is to be lost, until each has arrived often.
 struct listening_provider {
     gcl_provider provider;
     std::map<std::string, int> events;

@@ -1,4 +1,4 @@
-// The loop under other threads: escapes and posted work wake a wait, at its outer and at its inner depth.
+// The event loop and other threads: escapes and posted work end a wait, nested or not.
 #include <atomic>
 #include <functional>
 #include <thread>
@@ -22,7 +22,8 @@ struct loop_thread {
 
     static void run_first(int, short, void *data) {
         auto *self = static_cast<loop_thread *>(data);
-        EXPECT_EQ(loop_event_set_timer(self->starter, 60000), LC_OK); // the loop has something to wait for
+        EXPECT_EQ(loop_event_set_timer(self->starter, 60000),
+                  LC_OK); // so that the loop has something to wait for
         if (self->first)
             self->first();
     }
@@ -42,7 +43,7 @@ struct loop_thread {
     void finish() {
         thread.join();
         loop_event_free(&starter);
-        EXPECT_EQ(lew_deinit(&wrapper), LC_OK); // the owner has ended
+        EXPECT_EQ(lew_deinit(&wrapper), LC_OK); // its owner thread has ended
     }
 };
 
@@ -114,7 +115,7 @@ TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
     EXPECT_EQ(all.carried, posters * each);
     EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
     it.thread.join();
-    // What comes too late is handed back, by name or with the loop.
+    // Later posts are handed back when they are withdrawn or the loop is freed.
     for (int &poster : unused)
         counted_post::send(&all, it.loop, 0, &poster);
     loop_withdraw_posted(it.loop, &unused[0]);
@@ -124,7 +125,7 @@ TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
     EXPECT_EQ(all.withdrawn, 2);
 }
 
-// A wait for one round ends with work that was posted: what it waits for may have been changed by that.
+// Posted work ends a wait for one round, because it may have changed what is waited for.
 TEST(LoopThreads, PostedWorkEndsANestedWait) {
     counts all;
     std::atomic<int> waiting{0};

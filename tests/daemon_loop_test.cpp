@@ -1,4 +1,4 @@
-// The loop: rounds that nest, events that go while they wait for their turn, the escape and signals.
+// The event loop: nested rounds, events that are removed while they are queued, the escape, and signals.
 #include "daemon/libevent_wrapper.h"
 
 #include <csignal>
@@ -26,7 +26,7 @@ struct Loop : testing::Test {
         EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
         EXPECT_EQ(wrapper, nullptr);
     }
-    // How it ended: "no events", "escaped", "ran" or a status.
+    // The result: "no events", "escaped", "ran" or a status.
     std::string dispatched(lc_status (*dispatch)(lew *, int *, int *)) const {
         int none = 5, escaped = 5;
         const lc_status status = dispatch(wrapper, &none, &escaped);
@@ -37,7 +37,7 @@ struct Loop : testing::Test {
     void escape() const { EXPECT_EQ(lew_escape_from_dispatch(wrapper), LC_OK); }
 };
 
-// An event that counts its runs; what it does then is the test's.
+// An event that counts its runs and performs an action of the test.
 struct watched {
     loop_event *event = nullptr;
     int runs = 0;
@@ -56,7 +56,7 @@ struct watched {
     }
     ~watched() { loop_event_free(&event); }
 };
-// On a pipe that has a byte in it until the event has run.
+// On a pipe that holds a byte until the event has run.
 struct readable : watched {
     int ends[2] = {-1, -1};
     void start(loop_context *loop) {
@@ -82,13 +82,13 @@ struct timer : watched {
 TEST_F(Loop, EndsWhenNothingIsRegistered) {
     EXPECT_EQ(whole(), "no events");
     EXPECT_EQ(once(), "no events");
-    timer only; // no event any more once it has fired
+    timer only; // after it has fired, no event is left
     only.start(loop, 30);
     const int64_t start = lt_monotonic_ms();
     EXPECT_EQ(whole(), "no events");
     EXPECT_EQ(only.runs, 1);
     EXPECT_GE(lt_monotonic_ms() - start, 25);
-    readable gone; // not even open any more: it shows, and takes itself away
+    readable gone; // closed: reported as ready, and removes itself
     gone.start(loop);
     close(gone.ends[0]);
     gone.action = [&] { loop_event_free(&gone.event); };
@@ -97,7 +97,7 @@ TEST_F(Loop, EndsWhenNothingIsRegistered) {
     int none = 5;
     EXPECT_EQ(lew_dispatch(nullptr, &none, nullptr), LC_NULL);
     EXPECT_EQ(none, 0);
-    std::thread([&] { EXPECT_EQ(whole() + once(), "1400214002"); }).join(); // the owner's alone
+    std::thread([&] { EXPECT_EQ(whole() + once(), "1400214002"); }).join(); // only the owner may dispatch
 }
 
 TEST_F(Loop, AnEscapeIsStickyAndEndsEachDepthAtOnce) {
@@ -111,7 +111,7 @@ TEST_F(Loop, AnEscapeIsStickyAndEndsEachDepthAtOnce) {
     };
     first.action = [&] {
         second.start(loop);
-        EXPECT_EQ(once(), "escaped"); // with the wait inside
+        EXPECT_EQ(once(), "escaped"); // when the inner wait has ended
     };
     first.start(loop);
     EXPECT_EQ(whole(), "escaped");
@@ -131,12 +131,12 @@ TEST_F(Loop, AnEscapeInACallbackEndsTheRoundBeforeTheNextOne) {
     EXPECT_EQ(first.runs + second.runs, 1);
 }
 
-// The outer callback waits by running the loop; what its own round had found beside it runs in there.
+// A callback waits by running the loop. The other events of its own round run in there.
 TEST_F(Loop, WaitsNestToAnyDepth) {
     constexpr int depth = 50;
     std::vector<readable> events(depth);
     int inside = 0, deepest = 0;
-    timer later; // nobody waits for this one
+    timer later; // not waited for
     later.start(loop, 5000);
     for (readable &each : events) {
         each.action = [&] {
@@ -155,7 +155,7 @@ TEST_F(Loop, WaitsNestToAnyDepth) {
         EXPECT_EQ(each.runs, 1);
 }
 
-TEST_F(Loop, ANestedWaitFindsWhatBecomesReadyMeanwhile) {
+TEST_F(Loop, ANestedWaitHandlesWhatBecomesReadyMeanwhile) {
     readable outer, later;
     timer due;
     later.start(loop);
@@ -171,11 +171,11 @@ TEST_F(Loop, ANestedWaitFindsWhatBecomesReadyMeanwhile) {
     EXPECT_EQ(outer.runs, 1);
 }
 
-// Two events ready in one round; whichever comes first takes the other away, by each way of doing so.
-TEST_F(Loop, AnEventTakenAwayByAnEarlierCallbackNeverRuns) {
+// Two events are ready in one round. The one that runs first removes the other, in each possible way.
+TEST_F(Loop, AnEventRemovedByAnEarlierCallbackNeverRuns) {
     for (int way = 0; way < 3; way++) {
         readable pair[2];
-        const auto take_away = [&, way](int other) {
+        const auto remove_other = [&, way](int other) {
             if (way == 1)
                 return loop_event_free(&pair[other].event);
             loop_event_remove(pair[other].event);
@@ -186,8 +186,8 @@ TEST_F(Loop, AnEventTakenAwayByAnEarlierCallbackNeverRuns) {
             nested.action = [&, other] { loop_event_free(&pair[other].event); };
             EXPECT_EQ(once(), "ran");
         };
-        pair[0].action = [&] { take_away(1); };
-        pair[1].action = [&] { take_away(0); };
+        pair[0].action = [&] { remove_other(1); };
+        pair[1].action = [&] { remove_other(0); };
         pair[0].start(loop);
         pair[1].start(loop);
         EXPECT_EQ(once(), "ran");
@@ -217,7 +217,7 @@ TEST_F(Loop, PostedWorkComesBeforeTheNextCallback) {
         ASSERT_EQ(once(), "ran");
 }
 
-// ---- Signals
+// --- Signals
 
 struct Signals : Loop {
     std::vector<int> numbers;
@@ -256,7 +256,7 @@ TEST_F(Signals, AreCallbacksInTheLoop) {
     }
     EXPECT_EQ(le_signal_contexts[SIGUSR1], nullptr);
     EXPECT_EQ(le_signal_contexts[SIGUSR2], loop);
-    // One ends a wait.
+    // A signal ends a wait.
     const pthread_t self = pthread_self();
     std::thread sender([&] {
         usleep(50000);
@@ -271,9 +271,9 @@ TEST_F(Signals, AreCallbacksInTheLoop) {
     EXPECT_EQ(whole(), "no events");
 }
 
-// The exit deletes the registrations from inside one of them; a second SIGTERM then stays blocked, or it
-// would end the process.
-TEST_F(Signals, AllMayGoInsideTheCallbackOfOne) {
+// The exit deletes all registrations in the callback of one of them. A second SIGTERM must stay blocked,
+// since it would end the process.
+TEST_F(Signals, AllCanBeDeletedInTheCallbackOfOne) {
     ASSERT_EQ(reg(wrapper, &slots[0], SIGTERM), LC_OK);
     ASSERT_EQ(reg(wrapper, &slots[1], SIGINT), LC_OK);
     raise(SIGTERM);
@@ -292,7 +292,7 @@ TEST_F(Signals, AllMayGoInsideTheCallbackOfOne) {
     sigwait(&pending, &taken);
 }
 
-TEST_F(Signals, AreOneContextsAndTheirNumberIsChecked) {
+TEST_F(Signals, BelongToOneContextAndTheirNumberIsChecked) {
     lew *other = nullptr;
     lew_event *slot = nullptr, *foreign = nullptr, *bad = nullptr;
     ASSERT_EQ(lew_init(&other), LC_OK);
@@ -303,7 +303,7 @@ TEST_F(Signals, AreOneContextsAndTheirNumberIsChecked) {
         EXPECT_EQ(reg(wrapper, &bad, number), LC_ASSERTION);
     EXPECT_EQ(reg(nullptr, &bad, SIGUSR2), LC_NULL);
     EXPECT_EQ(bad, nullptr);
-    // A filled slot is registered anew, but only where it is known.
+    // A filled slot is registered again, but only in its own context.
     EXPECT_EQ(reg(other, &slot, SIGUSR2), LC_NOT_FOUND);
     EXPECT_EQ(lew_event_delete(other, &slot), LC_NOT_FOUND);
     EXPECT_EQ(reg(wrapper, &slot, SIGUSR2), LC_OK);

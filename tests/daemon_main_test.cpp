@@ -1,4 +1,4 @@
-// The small steps of the start, each by itself: the pid file, the reserved entries, what signals do.
+// Single steps of the start: the pid file, the encapsulation ranges, signals, and the service manager.
 #include "daemon/wccpd_main.h"
 
 #include <csignal>
@@ -47,8 +47,8 @@ TEST_F(DaemonMain, ThePidFile) {
     EXPECT_EQ(content("/tmp/precious"), "kept");
 }
 
-TEST_F(DaemonMain, EntriesOfTheEncapsulations) {
-    std::ofstream(PLATFORM_CONF_PATH) << "max_user_tunnels 78\n"; // 100 with those of the system
+TEST_F(DaemonMain, EncapsulationRanges) {
+    std::ofstream(PLATFORM_CONF_PATH) << "max_user_tunnels 78\n"; // 100 with the 22 of the system
     EXPECT_EQ(qv_encap_setup_entries(), 184u);
     EXPECT_EQ(g_qv_encap_wccp_first, 110u);
     EXPECT_EQ(g_qv_encap_wccp_last, 141u);
@@ -56,7 +56,7 @@ TEST_F(DaemonMain, EntriesOfTheEncapsulations) {
     EXPECT_EQ(g_qv_encap_clstr_last, 182u);
 }
 
-TEST_F(DaemonMain, SignalsThatLeaveItRunning) {
+TEST_F(DaemonMain, SignalsThatDoNotEndIt) {
     for (const int number : {SIGPIPE, SIGUSR1, SIGUSR2, SIGCHLD})
         EXPECT_EQ(wccpd_handle_signal(number, 0, nullptr, nullptr), LC_OK);
     EXPECT_EQ(wccpd_shutdown_in_progress(), 0);
@@ -65,12 +65,12 @@ TEST_F(DaemonMain, SignalsThatLeaveItRunning) {
     EXPECT_EQ(said("Got unexpected signal SIGCHLD"), 1);
 }
 
-// The reports of being alive stop while the engine's lock is not to be had.
+// Keep-alive messages stop while the engine lock is held.
 TEST_F(DaemonMain, ReportsToItsServiceManager) {
     const int manager = socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK, 0);
     sockaddr_un address = {AF_UNIX, "\0manager"};
     ASSERT_EQ(bind(manager, reinterpret_cast<sockaddr *>(&address), sizeof(sa_family_t) + 8), 0);
-    const auto heard = [&] {
+    const auto received = [&] {
         char text[64];
         const ssize_t length = recv(manager, text, sizeof text, 0);
         return length < 0 ? std::string() : std::string(text, static_cast<size_t>(length));
@@ -83,20 +83,20 @@ TEST_F(DaemonMain, ReportsToItsServiceManager) {
     EXPECT_EQ(service_watchdog_ms(), 48);
     ASSERT_EQ(lew_init(&wccpd_lwc), LC_OK);
     ASSERT_EQ(wccpd_service_ready(), LC_OK);
-    EXPECT_EQ(heard(), "READY=1");
-    EXPECT_EQ(heard(), "WATCHDOG=1");
+    EXPECT_EQ(received(), "READY=1");
+    EXPECT_EQ(received(), "WATCHDOG=1");
     (void)lew_dispatch_once(wccpd_lwc, nullptr, nullptr);
-    EXPECT_EQ(heard(), "WATCHDOG=1");
+    EXPECT_EQ(received(), "WATCHDOG=1");
     pthread_mutex_lock(&wccp_g.lock);
     (void)lew_dispatch_once(wccpd_lwc, nullptr, nullptr);
-    EXPECT_EQ(heard(), "");
+    EXPECT_EQ(received(), "");
     pthread_mutex_unlock(&wccp_g.lock);
     wccpd_service_deinit();
     EXPECT_EQ(lew_deinit(&wccpd_lwc), LC_OK);
     close(manager);
 }
 
-TEST_F(DaemonMain, WithoutALoopNothingStarts) {
+TEST_F(DaemonMain, NothingStartsWithoutALoop) {
     EXPECT_EQ(wccpd_serv_init(), LC_ASSERTION);
     EXPECT_EQ(wccpd_main_loop(), LC_NULL);
 }

@@ -1,10 +1,9 @@
-// The monitoring tree over an engine without threads: every node's type and value, what is listed, and what
-// is answered for that which isn't there.
+// The monitoring tree over an engine without threads: the type and value of every node, what is listed, and
+// the answers for groups, routers and nodes that do not exist.
 #include "daemon/wccpd_monitor.h"
 #include "engine/wccp_utils.h"
 #include "runtime/list.h"
 
-#include <map>
 #include <vector>
 
 #include "tests/support/daemon_engine.h"
@@ -13,31 +12,34 @@ namespace {
 
 const std::string STATE = "/qv/wccpd/wccp/srv_grp/state";
 const std::string SYSTEM = "/qv/wccpd/system/state/";
+const std::string NOTHING = "nothing";
 
 be32 address(uint32_t last_octet) {
     return to_be32(0x0a000000 | last_octet);
 }
 
-// Type and text of the one binding that answers, or what came in its place.
-std::string one(uint32_t type, const std::string &text) {
-    return "type " + std::to_string(type) + ": " + text;
-}
-const std::string NOTHING = "nothing";
-
+// Type and text of the one binding that answers, "uint32 2" for example.
 std::string get(const std::string &name, bool in_walk = false) {
+    static const std::pair<uint32_t, const char *> types[] = {{bn_type_str, "str "},
+                                                              {bn_type_uint32, "uint32 "},
+                                                              {bn_type_ipv4addr, "ipv4addr "},
+                                                              {bn_type_duration_ms, "ms "}};
     owner<tstr_array, tstr_array_free> parts;
     EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
     binding_list out;
     const lc_status status = wccpd_mon_handle_get(name.c_str(), parts, &in_walk, out.array);
     const uint32_t count = bn_binding_array_length_quick(out.array);
     if (status != LC_OK || count != 1)
-        return status ? "status " + std::to_string(status) : count ? "too much" : NOTHING;
+        return status ? "status " + std::to_string(status) : count ? "several" : NOTHING;
     uint32_t type = 0;
     EXPECT_EQ(bn_binding_get_name_quick(out.last()), name);
     EXPECT_EQ(bn_binding_get_type(out.last(), bn_attrib_value, &type, nullptr), LC_OK);
-    return one(type, text_of([&](char **text) {
-                   return bn_binding_get_str(out.last(), bn_attrib_value, 0, nullptr, text);
-               }));
+    std::string text;
+    for (const auto &[number, word] : types)
+        text += number == type ? word : "";
+    return text + text_of([&](char **value) {
+               return bn_binding_get_str(out.last(), bn_attrib_value, 0, nullptr, value);
+           });
 }
 std::string children(const std::string &name) {
     owner<tstr_array, tstr_array_free> parts, names;
@@ -80,115 +82,113 @@ struct DaemonMonitor : testing::Test {
         group->appliance_view_count++;
     }
     static std::string of_51(const std::string &node) { return get(STATE + "/51/" + node); }
+    // "NODE VALUE; NODE VALUE" and so on. Nodes are below group 51, with a dot below the system, with a slash
+    // below the state of all groups.
+    static void are(const std::string &wanted) {
+        for (size_t at = 0, end; at < wanted.size(); at = end + 2) {
+            end = std::min(wanted.find("; ", at), wanted.size());
+            const std::string node = wanted.substr(at, wanted.find(' ', at) - at);
+            const std::string name = node[0] == '.'   ? SYSTEM + node.substr(1)
+                                     : node[0] == '/' ? STATE + node
+                                                      : STATE + "/51/" + node;
+            EXPECT_EQ(get(name), wanted.substr(at + node.size() + 1, end - at - node.size() - 1)) << node;
+        }
+    }
     int said(const std::string &line) { return engine.log.count(line); }
 };
 
-TEST_F(DaemonMonitor, TheGroup) {
+TEST_F(DaemonMonitor, Group) {
     add_router(201);
     add_router(202);
     add_appliance(1, 100);
     add_appliance(2, 65535);
-    EXPECT_EQ(of_51("oper"), one(bn_type_str, "INIT"));
-    EXPECT_EQ(of_51("uptime"), one(bn_type_duration_ms, "0"));
-    EXPECT_EQ(of_51("app_id"), one(bn_type_str, "10.0.0.1"));
-    EXPECT_EQ(of_51("num_routers"), one(bn_type_uint32, "2"));
-    EXPECT_EQ(of_51("num_appliances"), one(bn_type_uint32, "2"));
-    EXPECT_EQ(of_51("appliance/1/ipaddr"), one(bn_type_ipv4addr, "10.0.0.2"));
-    EXPECT_EQ(of_51("appliance/1/weight"), one(bn_type_uint32, "65535"));
-    EXPECT_EQ(of_51("appliance/2/ipaddr"), one(bn_type_ipv4addr, "10.0.0.1"));
-    EXPECT_EQ(of_51("appliance/3/ipaddr"), one(bn_type_ipv4addr, "0.0.0.0"));
-    EXPECT_EQ(of_51("appliance/3/weight"), one(bn_type_uint32, "0"));
+    are("oper str INIT; uptime ms 0; app_id str 10.0.0.1; num_routers uint32 2; num_appliances uint32 2; "
+        "appliance/1/ipaddr ipv4addr 10.0.0.2; appliance/1/weight uint32 65535; "
+        "appliance/2/ipaddr ipv4addr 10.0.0.1; "
+        "appliance/3/ipaddr ipv4addr 0.0.0.0; appliance/3/weight uint32 0"); // does not exist
     group->state_flags = WCCP_STATE_ACTIVE;
     group->designated = 1;
-    wccp_g.seconds = group->state_time + 5000000; // more milliseconds than 32 bits hold
-    EXPECT_EQ(of_51("uptime"), one(bn_type_duration_ms, "5000000000"));
-    EXPECT_EQ(get(STATE + "/307/oper"), one(bn_type_str, "ACTIVE, DESIGNATED")); // 51 in eight bits
-    group->designated = 0;
-    group->state_flags = WCCP_STATE_BACKUP;
-    EXPECT_EQ(of_51("oper"), one(bn_type_str, "BACKUP"));
-    group->state_flags = 0;
-    EXPECT_EQ(of_51("oper"), one(bn_type_str, "not-set"));
+    wccp_g.seconds = group->state_time + 5000000;                  // in milliseconds more than 32 bits
+    are("uptime ms 5000000000; /307/oper str ACTIVE, DESIGNATED"); // 307 in 8 bits is 51
+    group->state_flags = group->designated = 0;
+    are("oper str not-set");
 }
 
-TEST_F(DaemonMonitor, RoutersAreCountedByTheirPlace) {
-    wccp_sending_router *second = add_router(201);
-    wccp_sending_router *first = add_router(202);
+TEST_F(DaemonMonitor, RoutersByTheirPlaceInTheList) {
+    wccp_sending_router *second = add_router(201), *first = add_router(202);
     first->state_time = wccp_g.seconds - 7;
     first->last_icu_time = wccp_g.seconds - 3;
-    EXPECT_EQ(of_51("router/1/heard"), one(bn_type_duration_ms, "3000"));
     first->flags = WCCP_RTR_TWO_WAY;
     second->flags = WCCP_RTR_ONE_WAY;
-    EXPECT_EQ(of_51("router/1/id"), one(bn_type_ipv4addr, "10.0.0.202"));
-    EXPECT_EQ(of_51("router/1/ipaddr"), one(bn_type_ipv4addr, "10.0.0.212"));
-    EXPECT_EQ(of_51("router/1/conn_time"), one(bn_type_duration_ms, "7000"));
-    EXPECT_EQ(of_51("router/1/state"), one(bn_type_str, "TWO-WAY connected"));
-    EXPECT_EQ(of_51("router/2/id"), one(bn_type_ipv4addr, "10.0.0.201"));
-    EXPECT_EQ(of_51("router/2/state"), one(bn_type_str, "ONE-WAY connected"));
     group->fwd_method = WCCP_METHOD_L2;
     group->ret_method = WCCP_METHOD_GRE;
-    for (const std::string node : {"fwd_method", "ret_method", "assign_method"})
-        EXPECT_EQ(of_51("router/1/" + node), one(bn_type_str, "not-set"));
+    are("router/1/heard ms 3000; router/1/id ipv4addr 10.0.0.202; router/1/ipaddr ipv4addr 10.0.0.212; "
+        "router/1/conn_time ms 7000; router/1/state str TWO-WAY connected; "
+        "router/2/id ipv4addr 10.0.0.201; router/2/state str ONE-WAY connected; "
+        "router/1/fwd_method str not-set; router/1/ret_method str not-set; router/1/assign_method str "
+        "not-set");
     group->state_flags |= WCCP_CAPABILITIES_SET;
-    EXPECT_EQ(of_51("router/1/fwd_method"), one(bn_type_str, "L2"));
-    EXPECT_EQ(of_51("router/1/ret_method"), one(bn_type_str, "GRE"));
-    EXPECT_EQ(of_51("router/1/assign_method"), one(bn_type_str, "not set"));
+    are("router/1/fwd_method str L2; router/1/ret_method str GRE; router/1/assign_method str not set");
     group->assign_method = WCCP_ASSIGN_MASK;
-    EXPECT_EQ(of_51("router/2/assign_method"), one(bn_type_str, "MASK"));
-    // A number that isn't there is answered from nothing.
-    for (const std::string number : {"0", "3", "4294967296"}) {
-        EXPECT_EQ(of_51("router/" + number + "/state"), one(bn_type_str, ""));
-        EXPECT_EQ(of_51("router/" + number + "/id"), one(bn_type_ipv4addr, "0.0.0.0"));
-    }
+    are("router/2/assign_method str MASK");
+    for (const std::string number : {"0", "3", "4294967296"}) // do not exist
+        are("router/" + number + "/state str ; router/" + number + "/id ipv4addr 0.0.0.0");
 
     first->view_appliance_count = 2;
     first->view_appliances[0] = {address(1), 100, 0, 85, 256, {}};
     first->view_appliances[1] = {address(2), 100, 0, 0, 256, {}};
-    EXPECT_EQ(of_51("router/1/appliance/10.0.0.1/load_dist"), one(bn_type_uint32, "33"));
-    EXPECT_EQ(of_51("router/1/appliance/10.0.0.2/load_dist"), one(bn_type_uint32, "0"));
+    are("router/1/appliance/10.0.0.1/load_dist uint32 33; router/1/appliance/10.0.0.2/load_dist uint32 0");
     first->view_appliances[0].buckets_total = 0;
-    EXPECT_EQ(of_51("router/1/appliance/10.0.0.1/load_dist"), one(bn_type_uint32, "0"));
-    EXPECT_EQ(of_51("router/1/appliance/10.0.0.3/load_dist"), NOTHING);
-    EXPECT_EQ(said("wccp_get_router_appliance_info: failed: status=1"), 1);
-    EXPECT_EQ(of_51("router/1/appliance/nobody/load_dist"), NOTHING);
-    EXPECT_EQ(said("wccp_get_router_appliance_info: failed: status=14020"), 1);
+    are("router/1/appliance/10.0.0.1/load_dist uint32 0; router/1/appliance/10.0.0.3/load_dist nothing; "
+        "router/1/appliance/nobody/load_dist nothing");
+    EXPECT_EQ(said("wccp_get_router_appliance_info: failed: status=1"), 2); // the second is 14020
 }
 
-TEST_F(DaemonMonitor, NodesThatOnlyStandForTheirChildren) {
-    for (const auto &[node, last] : std::map<std::string, std::string>{
-             {"/51", "51"}, {"/7/router/99", "99"}, {"/7/router/1/appliance/10.0.0.9", "10.0.0.9"}})
-        EXPECT_EQ(get(STATE + node), one(bn_type_str, last));
-    EXPECT_EQ(said("cannot find group"), 0); // the engine isn't asked
-}
-
-TEST_F(DaemonMonitor, WhatIsNotThere) {
-    for (const std::string node : {"oper", "debug", "appliance/1/weight"})
-        EXPECT_EQ(get(STATE + "/7/" + node), NOTHING);
-    EXPECT_EQ(said("wccp_get_grp_info failed: 1"), 3);
-    EXPECT_EQ(get(STATE + "/7/router/1/state"), "status 1");
-    for (const char *node :
-         {"colour", "router/1/colour", "oper/deeper", "router", "appliance", "router/1/appliance"})
-        EXPECT_EQ(of_51(node), NOTHING);
-    EXPECT_EQ(said("Appliance number (at 9th) not found in " + STATE + "/51/router/1/appliance"), 1);
-    EXPECT_EQ(said("MonGet: last_name_part=deeper"), 1);
+TEST_F(DaemonMonitor, ParentsAndAbsentNodes) {
+    are("/51 str 51; /7/router/99 str 99; /7/router/1/appliance/10.0.0.9 str 10.0.0.9");
+    EXPECT_EQ(said("cannot find group"), 0); // the engine is not asked for a parent
+    are("/7/oper nothing; /7/debug nothing; /7/appliance/1/weight nothing; /7/router/1/state status 1; "
+        "colour nothing; router/1/colour nothing; oper/deeper nothing; router nothing; appliance nothing; "
+        "router/1/appliance nothing");
     EXPECT_EQ(get("/qv/tunneld/system/state/proto_ver"), NOTHING);
-    EXPECT_EQ(said("MonGet not for wccpd, bailing - /qv/tunneld/system/state/proto_ver"), 1);
+    for (const auto &[line, count] :
+         {std::pair{"wccp_get_grp_info failed: 1", 3},
+          {"Appliance number (at 9th) not found in /qv/wccpd/wccp/srv_grp/state/51/router/1/appliance", 1},
+          {"MonGet: last_name_part=deeper", 1},
+          {"MonGet not for wccpd, bailing - /qv/tunneld/system/state/proto_ver", 1}})
+        EXPECT_EQ(said(line), count) << line;
 }
 
-TEST_F(DaemonMonitor, TheTexts) {
+TEST_F(DaemonMonitor, Dumps) {
     const auto holds = [](const std::string &got, const std::string &part) {
-        return got.starts_with(one(bn_type_str, "")) && got.find(part) != std::string::npos;
+        EXPECT_TRUE(got.starts_with("str ") && got.find(part) != std::string::npos) << part;
     };
-    EXPECT_EQ(get(SYSTEM + "proto_ver"), one(bn_type_str, "2.0"));
-    EXPECT_EQ(get(SYSTEM + "is_alive"), one(bn_type_str, "Initializing"));
-    EXPECT_TRUE(holds(get(SYSTEM + "debug_global"), "    WCCP # of groups                 : 1\n"));
-    EXPECT_TRUE(holds(get(SYSTEM + "debug_all"), "WCCP GROUP ID 51 END"));
-    EXPECT_TRUE(holds(of_51("debug"), "WCCP GROUP 51 INFO END"));
-    EXPECT_TRUE(holds(of_51("assignment"), "Received router allocation"));
+    are(".proto_ver str 2.0; .is_alive str Initializing");
+    holds(get(SYSTEM + "debug_global"), "    WCCP # of groups                 : 1\n");
+    holds(get(SYSTEM + "debug_all"), "WCCP GROUP ID 51 END");
+    holds(of_51("debug"), "WCCP GROUP 51 INFO END");
+    holds(of_51("assignment"), "Received router allocation");
+    // Too long: the group's own text is cut, the others have no value, and nothing fails.
+    while (group->sending_router_count < WCCP_MAX_ROUTERS)
+        add_router(group->sending_router_count + 20)->view_appliance_count = WCCP_MAX_APPLIANCES;
+    const std::string cut = of_51("debug");
+    holds(cut, "WCCP GROUP 51 INFO START");
+    EXPECT_TRUE(cut.size() > 16000 && cut.size() < 16384 && cut.back() == '\n');
+    are("assignment nothing");
+    EXPECT_GT(said(".ERR]"), 1);
+    engine.log.clear();
+    EXPECT_EQ(get(STATE + "/51/debug", true), cut); // in a walk that is no error
+    for (const std::string &each : {STATE + "/51/assignment", SYSTEM + "debug_all"})
+        EXPECT_EQ(get(each, true), NOTHING);
+    EXPECT_EQ(said(".ERR]"), 0);
+    are(".debug_all nothing");
+    EXPECT_GE(said(".ERR]"), 1);
+    holds(get(SYSTEM + "debug_global"), "debug buffer: used");
+}
 
-    // Owners: nothing before there is an agreement, then what routers report, then what is computed here.
-    const auto is_owners = [](const std::string &text) {
-        EXPECT_EQ(of_51("owners"), one(bn_type_str, text));
-    };
+// None until there is an agreement, then what routers report, then what this appliance has computed.
+TEST_F(DaemonMonitor, Owners) {
+    const auto is_owners = [](const std::string &text) { EXPECT_EQ(of_51("owners"), "str " + text); };
     is_owners("");
     group->assign_method = WCCP_ASSIGN_HASH;
     add_appliance(2, 100);
@@ -205,7 +205,7 @@ TEST_F(DaemonMonitor, TheTexts) {
     std::fill_n(group->bucket_ipa, 200, address(1));
     std::fill_n(group->bucket_ipa + 200, 56, address(2));
     is_owners("hash members 10.0.0.1 10.0.0.2 owners 10.0.0.1*200 10.0.0.2*56");
-    group->assign_method = WCCP_ASSIGN_MASK; // the table is of another kind, and the router's map unknown
+    group->assign_method = WCCP_ASSIGN_MASK; // the table has another size, and the router's map is unknown
     group->mask_src_ip = 3;
     group->mask_dst_ip = 0;
     reporter->total_buckets = 4;
@@ -214,7 +214,7 @@ TEST_F(DaemonMonitor, TheTexts) {
     memset(reporter->view_appliances[0].bucket_bits, 0x05, 1);
     reporter->view_appliances[1].bucket_bits[0] = 0;
     is_owners("mask 3 0 0 0 members 10.0.0.1 10.0.0.2 owners 10.0.0.2*1 0.0.0.0*1 10.0.0.2*1 0.0.0.0*1");
-    group->mask_dst_ip = 0x1f10; // too many bits: the mask that the assignment uses instead
+    group->mask_dst_ip = 0x1f10; // too many bits: the default mask
     group->designated = 0;
     is_owners("mask 0 f00 0 0 members 10.0.0.1 10.0.0.2 owners 10.0.0.2*1 0.0.0.0*1 10.0.0.2*1 0.0.0.0*13");
     for (uint32_t i = 0; i < WCCP_MAX_BUCKETS; i++) // the longest text fits
@@ -222,30 +222,9 @@ TEST_F(DaemonMonitor, TheTexts) {
     group->assign_method = WCCP_ASSIGN_HASH;
     group->designated = 1;
     EXPECT_GT(of_51("owners").size(), 16u * 256);
-
-    // Too long: the group's own text comes cut, the others don't come, and nothing fails.
-    while (group->sending_router_count < WCCP_MAX_ROUTERS) {
-        wccp_sending_router *router = add_router(group->sending_router_count + 20);
-        router->view_appliance_count = WCCP_MAX_APPLIANCES;
-    }
-    const std::string cut = of_51("debug");
-    EXPECT_TRUE(holds(cut, "WCCP GROUP 51 INFO START"));
-    EXPECT_GT(cut.size(), 16000u);
-    EXPECT_LT(cut.size(), 16384u);
-    EXPECT_EQ(cut.back(), '\n');
-    EXPECT_EQ(of_51("assignment"), NOTHING);
-    EXPECT_GT(said(".ERR]"), 1);
-    engine.log.clear();
-    EXPECT_EQ(get(STATE + "/51/debug", true), cut);
-    for (const std::string &each : {STATE + "/51/assignment", SYSTEM + "debug_all"})
-        EXPECT_EQ(get(each, true), NOTHING);
-    EXPECT_EQ(said(".ERR]"), 0);
-    EXPECT_EQ(get(SYSTEM + "debug_all"), NOTHING);
-    EXPECT_GE(said(".ERR]"), 1);
-    EXPECT_TRUE(holds(get(SYSTEM + "debug_global"), "debug buffer: used"));
 }
 
-TEST_F(DaemonMonitor, ReasonsAndCounters) {
+TEST_F(DaemonMonitor, ReasonsCountersAndInterfaces) {
     const auto note = [](wccp_service_group *of, wccp_reason_code code, uint32_t sender) {
         wccp_note_reason(of, code, address(sender), wccp_reason_value("gre"), wccp_reason_value("L2"));
     };
@@ -256,49 +235,35 @@ TEST_F(DaemonMonitor, ReasonsAndCounters) {
     note(group, WCCP_REASON_FORWARDING_NOT_OFFERED, 202);
     wccp_g.seconds += 2;
     wccp_forget_reason(group, WCCP_REASON_PASSWORD_MISMATCH, address(201));
-    const std::string of_group = children(STATE + "/51/reason"),
-                      place = of_group.substr(0, of_group.find(' '));
-    EXPECT_EQ(place.size() + 1, of_group.size()) << "one reason, and it keeps its place: " << of_group;
-    const std::string at = "reason/" + place + "/";
-    EXPECT_EQ(of_51("reason/" + place), one(bn_type_str, place));
-    EXPECT_EQ(of_51(at + "code"), one(bn_type_str, "forwarding-not-offered"));
-    EXPECT_EQ(of_51(at + "sender"), one(bn_type_ipv4addr, "10.0.0.202"));
-    EXPECT_EQ(of_51(at + "offered"), one(bn_type_str, "gre"));
-    EXPECT_EQ(of_51(at + "wanted"), one(bn_type_str, "L2"));
-    EXPECT_EQ(of_51(at + "count"), one(bn_type_uint32, "2"));
-    EXPECT_EQ(of_51(at + "first"), one(bn_type_duration_ms, "7000"));
-    EXPECT_EQ(of_51(at + "last"), one(bn_type_duration_ms, "2000"));
+    EXPECT_EQ(children(STATE + "/51/reason"), "2 ") << "it keeps its place";
+    are("reason/2 str 2; reason/2/code str forwarding-not-offered; reason/2/sender ipv4addr 10.0.0.202; "
+        "reason/2/offered str gre; reason/2/wanted str L2; reason/2/count uint32 2; reason/2/first ms 7000; "
+        "reason/2/last ms 2000; .reason/1/code str group-unknown");
     EXPECT_EQ(children(SYSTEM + "reason"), "1 ");
-    EXPECT_EQ(get(SYSTEM + "reason/1/code"), one(bn_type_str, "group-unknown"));
-    for (const std::string gone : {"0", "40", "41", "4294967297", "x"})
-        EXPECT_EQ(of_51("reason/" + gone + "/code"), NOTHING);
+    are("reason/0/code nothing; reason/40/code nothing; reason/41/code nothing; "
+        "reason/4294967297/code nothing; reason/x/code nothing");
     EXPECT_EQ(children(STATE + "/7/reason"), "");
     note(group, WCCP_REASON_ROUTER_SILENT, 202);
     note(group, WCCP_REASON_SEND_FAILED, 202);
-    wccp_g.seconds += 61; // nothing repeats it, and what is not repeated stays
+    wccp_g.seconds += 61; // most reasons that come from packets end when they are not repeated
     EXPECT_EQ(children(SYSTEM + "reason"), "");
-    EXPECT_EQ(get(SYSTEM + "reason/1/code"), NOTHING);
-    EXPECT_EQ(of_51("reason/1/code"), one(bn_type_str, "router-silent"));
+    are(".reason/1/code nothing; reason/1/code str router-silent");
     EXPECT_EQ(children(STATE + "/51/reason").size(), 4u);
 
     group->start_time = wccp_g.seconds - 9;
     group->rx_icu_failures = 4294967295;
-    EXPECT_EQ(of_51("since"), one(bn_type_duration_ms, "9000"));
-    EXPECT_EQ(of_51("pending_acks"), one(bn_type_uint32, "0"));
-    EXPECT_EQ(of_51("counter/rx_icu_failures"), one(bn_type_uint32, "4294967295"));
-    EXPECT_EQ(of_51("counter/weight"), NOTHING);
+    engine.interface->link_down_count = 3;
+    are("since ms 9000; pending_acks uint32 0; counter/rx_icu_failures uint32 4294967295; "
+        "counter/weight nothing; .interface/lan0/link_downs uint32 3; "
+        ".interface/lan0/address ipv4addr 10.0.0.1; .interface/lan1/link_downs nothing");
+    EXPECT_EQ(children(SYSTEM + "interface"), "lan0 ");
     for (const char *word : {"rx_icu_failures ", "rx_removal_failures ", "tx_build_failures ",
                              "tx_link_drops ", "routers_timed_out "})
         EXPECT_NE(children(STATE + "/51/counter").find(word), std::string::npos) << word;
-    engine.interface->link_down_count = 3;
-    EXPECT_EQ(children(SYSTEM + "interface"), "lan0 ");
-    EXPECT_EQ(get(SYSTEM + "interface/lan0/link_downs"), one(bn_type_uint32, "3"));
-    EXPECT_EQ(get(SYSTEM + "interface/lan0/address"), one(bn_type_ipv4addr, "10.0.0.1"));
-    EXPECT_EQ(get(SYSTEM + "interface/lan1/link_downs"), NOTHING);
     EXPECT_EQ(said(".ERR]"), 0);
 }
 
-TEST_F(DaemonMonitor, WhatIsListed) {
+TEST_F(DaemonMonitor, Lists) {
     add_group(200);
     add_group(0);
     wccp_sending_router *second = add_router(201);
@@ -306,18 +271,22 @@ TEST_F(DaemonMonitor, WhatIsListed) {
     second->view_appliance_count = 2;
     second->view_appliances[0].ipa = address(9);
     second->view_appliances[1].ipa = address(1);
-    EXPECT_EQ(children(STATE), "0 51 200 ");
-    EXPECT_EQ(children(STATE + "/51/router"), "1 2 ");
-    EXPECT_EQ(children(STATE + "/51/router/2/appliance"), "10.0.0.9 10.0.0.1 ");
-    EXPECT_EQ(children(STATE + "/51/router/1/appliance"), "");
-    EXPECT_EQ(children(STATE + "/200/router"), "");
-    EXPECT_EQ(children(STATE + "/51"), "");
-    EXPECT_EQ(children(STATE + "/51/appliance"), "");
-    EXPECT_EQ(children(STATE + "/7/router"), "");
-    EXPECT_EQ(said("wccp_get_router_list: failed: status=1"), 1);
-    EXPECT_EQ(children(STATE + "/51/router/3/appliance"), "");
-    EXPECT_EQ(said("wccp_get_router_appliance_list failed: status=1"), 1);
-    EXPECT_EQ(said("iterate " + STATE + "/51/router/2/appliance"), 1);
+    const std::pair<const char *, const char *> lists[] = {
+        {"", "0 51 200 "},
+        {"/51/router", "1 2 "},
+        {"/51/router/2/appliance", "10.0.0.9 10.0.0.1 "},
+        {"/200/router", ""},
+        {"/51", ""},
+        {"/51/router/1/appliance", ""},
+        {"/51/appliance", ""},
+        {"/7/router", ""},
+        {"/51/router/3/appliance", ""},
+    };
+    for (const auto &[node, names] : lists)
+        EXPECT_EQ(children(STATE + node), names) << node;
+    for (const std::string line :
+         {"wccp_get_router_list: failed: status=1", "wccp_get_router_appliance_list failed: status=1"})
+        EXPECT_EQ(said(line), 1) << line;
 }
 
 } // namespace

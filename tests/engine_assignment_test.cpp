@@ -1,5 +1,5 @@
-// The table of the designated appliance: the split, the order of the owners, down entries, and the mask's
-// values.
+// The designated appliance's table: the split, the order of the owners, down entries, and the values of the
+// mask.
 #include "engine/wccp_assignment.h"
 
 #include <algorithm>
@@ -61,7 +61,7 @@ TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
         uint32_t slots;
         const char *runs;
     } cases[] = {
-        // In proportion, and the remainder goes on.
+        // In proportion; remainders are passed on.
         {"1:100 2:100 3:100", 256, "1:85 2:85 3:86"},
         {"1:1 2:2", 256, "1:85 2:171"},
         {"1:10 2:20 3:30 4:40", 256, "1:25 2:51 3:77 4:103"},
@@ -71,23 +71,23 @@ TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
         {"1:3 2:3 3:3", 16, "1:5 2:5 3:6"},
         {"1:65535 2:1 3:65535", 256, "1:127 2:1 3:128"},
         {"1:1 2:1 3:1", 1, "3:1"},
-        // Only the run of a down entry is split; it may be too light to hold a slot.
+        // Only the run of a down entry is split again. It can be too light to have slots.
         {"1:100 -2:100 3:100", 256, "1:127 3:129"},
         {"1:30 -2:30 -3:30 4:30", 256, "1:96 4:32 1:32 4:96"},
         {"-1:65535 2:1", 256, "2:256"},
         {"-1:1 2:60000", 256, "2:256"},
-        // Without weights the largest word takes all. A down entry's weight doesn't count.
+        // Without active weights the largest word gets everything.
         {"2:0 1:0", 256, "2:256"},
         {"9.1:0 2:0", 256, "2:256"},
         {"-9:500 3:0", 256, "3:256"},
-        {"-9:500 -3:0", 256, "77:256"}, // as it was
+        {"-9:500 -3:0", 256, "77:256"}, // unchanged
         {"", 256, "77:256"},
-        // The last octet leads the order, and the difference wraps around.
+        // The last octet is the most significant, and the difference wraps around.
         {"2:1 1.1:1 1:2", 256, "1:128 1.1:64 2:64"},
         {"10:1 200:3", 256, "200:192 10:64"},
         {"200:3 10:1", 256, "200:192 10:64"},
-        // Three in a circle: 1 before 100, 100 before 200, 200 before 1. What comes out is what a merge sort,
-        // which glibc's qsort is, makes of each order: the first is merged into the sorted pair of the rest.
+        // Not transitive: 1 before 100, 100 before 200, 200 before 1. The results are those of a merge sort,
+        // glibc's qsort, which merges the first into the sorted pair of the others.
         {"1:1 100:1 200:2", 256, "1:64 100:64 200:128"},
         {"200:2 100:1 1:1", 256, "200:128 1:64 100:64"},
         {"100:1 1:1 200:2", 256, "100:64 200:128 1:64"},
@@ -115,7 +115,7 @@ TEST(AssignmentTable, ShuffleFollowsTheSeed) {
         EXPECT_EQ(raw_word(table[i]), expected[i]);
 }
 
-// A group that nobody else knows, and its computation.
+// A group outside the engine's tables.
 struct AssignmentTest : testing::Test {
     AssignmentTest() { group->assign_method = WCCP_ASSIGN_HASH; }
     void compute(const entries &appliances) {
@@ -125,7 +125,7 @@ struct AssignmentTest : testing::Test {
                                                   each.weight, 1,       WCCP_LISTED_BY_ALL};
             wccp_designated_appliance_assignment_add(group.get(), &reported);
             ASSERT_LE(group->dsg_appliance_count, WCCP_MAX_APPLIANCES);
-            ASSERT_EQ(group->bucket_count, 0u); // lies right after the entries
+            ASSERT_EQ(group->bucket_count, 0u); // directly after the entries in memory
         }
         wccp_designated_appliance_assignment_finish(group.get());
     }
@@ -142,7 +142,8 @@ struct AssignmentTest : testing::Test {
     std::unique_ptr<wccp_service_group> group = std::make_unique<wccp_service_group>();
 };
 
-// Whatever the weights, each slot has an active owner, and the same input gives the same table.
+// With any weights, each slot has an active owner, the same input gives the same table, and when appliances
+// leave, the slots of the others do not move.
 TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
     uint32_t state = 20011;
     const auto random = [&state](uint32_t below) {
@@ -155,25 +156,22 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
         group->mask_dst_ip = 0x7f >> random(8);
         group->mask_bits = static_cast<uint32_t>(__builtin_popcount(group->mask_dst_ip));
         entries appliances, staying;
-        const uint32_t count = 1 + random(32);
-        for (uint32_t i = 0; i < count; i++) {
-            const uint32_t kind = random(4);
-            const uint32_t weight = kind == 0 ? 0 : kind == 1 ? 65535 : random(65536);
-            appliances.push_back(entry(random(256) << 8 | (i * 8 + random(8)), weight));
+        uint32_t weight = 0;
+        for (uint32_t i = 0, count = 1 + random(32); i < count; i++) {
+            const uint32_t kind = random(4), any = random(65536);
+            appliances.push_back(entry(random(256) << 8 | (i * 8 + random(8)), kind == 0   ? 0
+                                                                               : kind == 1 ? 65535
+                                                                                           : any));
+            if (i == 0 || random(3)) {
+                staying.push_back(appliances.back());
+                weight += appliances.back().weight;
+            }
         }
         compute(appliances);
         const std::vector<be32> whole(group->bucket_ipa, group->bucket_ipa + 256);
         ASSERT_EQ(assigned_in_all(), group->bucket_count);
         compute(appliances);
         ASSERT_EQ(memcmp(whole.data(), group->bucket_ipa, sizeof group->bucket_ipa), 0);
-
-        // Some leave: the slots of those that stay don't move.
-        uint32_t weight = 0;
-        for (uint32_t i = 0; i < count; i++)
-            if (i == 0 || random(3)) {
-                staying.push_back(appliances[i]);
-                weight += appliances[i].weight;
-            }
         compute(staying);
         ASSERT_EQ(assigned_in_all(), group->bucket_count);
         ASSERT_EQ(group->dsg_active_count, staying.size());
@@ -187,13 +185,13 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
 TEST_F(AssignmentTest, AnApplianceThatLeavesIsDownForOneComputation) {
     group->assign_method = WCCP_ASSIGN_NONE;
     compute(parse("3:100 1:100 2:100"));
-    EXPECT_EQ(group->bucket_count, 0u); // no method, no table
+    EXPECT_EQ(group->bucket_count, 0u); // no method agreed
     EXPECT_TRUE(is_zero(group->bucket_ipa[0]));
     EXPECT_EQ(group->dsg_active_count, 3u);
 
     group->assign_method = WCCP_ASSIGN_HASH;
     compute(parse("3:100 1:100 2:100"));
-    // Entries stand in order of arrival, runs in sorted order.
+    // Entries are in order of arrival, runs in sorted order.
     EXPECT_EQ(group->dsg_appliances[0].ipa, host(3));
     EXPECT_EQ(group->bucket_index[0], 1);
     EXPECT_EQ(group->bucket_index[85], 2);
@@ -206,7 +204,7 @@ TEST_F(AssignmentTest, AnApplianceThatLeavesIsDownForOneComputation) {
         uint16_t of_3;
     } rounds[] = {{"1:100 3:100", "1:127 3:129", 129},
                   {"1:100 3:100", "1:128 3:128", 128},
-                  {"1:300 3:100", "1:192 3:64", 64}}; // a new weight is taken over
+                  {"1:300 3:100", "1:192 3:64", 64}}; // a new weight
     for (const auto &round : rounds) {
         compute(parse(round.appliances));
         EXPECT_EQ(runs(), round.runs);
@@ -224,10 +222,10 @@ TEST_F(AssignmentTest, AnApplianceThatLeavesIsDownForOneComputation) {
     EXPECT_TRUE(is_zero(group->dsg_appliances[0].ipa));
 }
 
-TEST_F(AssignmentTest, DownEntriesGiveWayWhereThereIsNoRoom) {
+TEST_F(AssignmentTest, DownEntriesAreDroppedWhenThereIsNoRoom) {
     entries first, second, third;
     for (uint32_t i = 1; i <= 32; i++) {
-        // Nothing of the light ones is left of the split, so they go first.
+        // The light ones have no slots, so they are dropped first.
         first.push_back(entry(i, i <= 10 ? 1 : 6000));
         second.push_back(entry(i + 50, 100));
         if (i > 20)
@@ -235,21 +233,21 @@ TEST_F(AssignmentTest, DownEntriesGiveWayWhereThereIsNoRoom) {
     }
     compute(first);
     third.insert(third.end(), second.begin(), second.begin() + 20);
-    compute(third); // 12 stay, 20 come, 20 are gone
+    compute(third); // 12 stay, 20 are new, 20 have left
     ASSERT_EQ(group->dsg_active_count, 32u);
     for (const wccp_dsg_appliance &each : third)
         EXPECT_TRUE(is_active(each.ipa));
     EXPECT_EQ(assigned_in_all(), 256u);
-    compute(second); // all but 20 replaced
+    compute(second); // all but 20 are replaced
     ASSERT_EQ(group->dsg_active_count, 32u);
     EXPECT_EQ(runs().substr(0, 4), "51:8");
-    second.push_back(entry(99, 100)); // more than anybody can report: the last one is left out
+    second.push_back(entry(99, 100)); // more than possible: the last one is left out
     compute(second);
     EXPECT_EQ(group->dsg_active_count, 32u);
     EXPECT_FALSE(is_active(host(99)));
 
-    // 5 and 6 leave and 40 comes. 6 keeps its place for this once, so its run of 8 slots is split among all
-    // that are there; had 5, the lightest, kept its place, there would be one slot to split.
+    // 5 and 6 leave and 40 is new. 6 keeps its place for this computation, so its 8 slots are split among all
+    // others; if 5, the lightest, kept its place, there would be one slot to split.
     *group = {};
     group->assign_method = WCCP_ASSIGN_HASH;
     entries appliances;
@@ -298,7 +296,7 @@ TEST_F(MaskTest, ValuesCountUpFromTheDestinationPortsLowestBit) {
     EXPECT_EQ(values_of({}), (list{{0, 0, 0, 0}}));
 }
 
-TEST_F(MaskTest, SevenBitsAreUsedAndEightAreReplaced) {
+TEST_F(MaskTest, SevenBitsAreUsedAndEightReplaced) {
     const list seven = values_of({0, 0x1741, 0, 1});
     EXPECT_EQ(seven.size(), 128u);
     EXPECT_EQ(seven.back(), (value{0, 0x1741, 0, 1}));
@@ -311,7 +309,7 @@ TEST_F(MaskTest, SevenBitsAreUsedAndEightAreReplaced) {
     ASSERT_EQ(eight.size(), 16u);
     for (uint32_t i = 0; i < 16; i++)
         EXPECT_EQ(eight[i], (value{0, i << 8, 0, 0}));
-    EXPECT_EQ(group->mask_values[16].dst_ip, 0u); // nothing left of the 128 of before
+    EXPECT_EQ(group->mask_values[16].dst_ip, 0u); // the earlier 128 values are cleared
 }
 
 TEST_F(MaskTest, ValuesAreSharedLikeBuckets) {
@@ -327,7 +325,7 @@ TEST_F(MaskTest, ValuesAreSharedLikeBuckets) {
     EXPECT_EQ(wccp_mask_assignment_assign_mask_values(group.get()), 1);
     EXPECT_EQ(group->dsg_appliances[0].assigned, 6);
 
-    values_of({}); // one value, which the last one in order gets
+    values_of({}); // one value, which the last appliance in order gets
     compute(parse("1:100 2:100"));
     EXPECT_EQ(runs(), "2:1");
     EXPECT_EQ(group->mask_values[0].appliance_ipa, host(2));

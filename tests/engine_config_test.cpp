@@ -1,5 +1,5 @@
-// Groups as configuration adds, changes, starts, stops and asks after them, on a real interface whose other
-// end is in a namespace of its own. Whatever a test does, the tables agree with each other at its end.
+// Groups as configuration adds, changes, starts, stops and queries them, on a real interface whose other end
+// is in another namespace. At the end of each test the tables must be consistent.
 
 #include "engine/wccp_config.h"
 #include "engine/wccp_query.h"
@@ -72,10 +72,10 @@ protected:
     engine_fixture engine;
 };
 
-TEST_F(Config, AddressesAreSortedUntilTheFirstMulticastOne) {
+TEST_F(Config, TheFirstMulticastAddressEndsTheRouterList) {
     const struct {
         std::vector<std::string> given;
-        size_t unicast; // so many of them, from the first
+        size_t unicast; // the number of unicast routers, from the first
         const char *multicast;
     } cases[] = {
         {{"10.0.0.1", "224.0.0.5", "10.0.0.2"}, 1, "224.0.0.5"},
@@ -97,23 +97,19 @@ TEST_F(Config, AddressesAreSortedUntilTheFirstMulticastOne) {
     EXPECT_EQ(add(full)->ucast_router_count, 32);
 }
 
-TEST_F(Config, ARecordIsTakenOverFieldByField) {
+TEST_F(Config, ARecordIsCopiedFieldByField) {
     wccp_grp_config with = config(61);
-    with.priority = 7;
-    with.protocol = 6;
     memcpy(with.password, "12345678", 8);
     with.hash_src_ip = 1;
     with.hash_dst_ip = 2; // only 1 counts
     with.hash_dst_port = 1;
     with.mask_src_ip = 0xf0000001;
     with.mask_dst_port = 0x0003;
-    with.force_l2_return = 1;
-    with.compatibility = 3; // 1 then
+    with.compatibility = 3; // invalid: 1 is used
     const wccp_service_group *group = add(with);
-    EXPECT_EQ((numbers{group->priority, group->protocol, group->force_l2_return, group->security_option,
-                       group->service_flags, group->mask_bits, group->compat_mode, group->state_flags,
+    EXPECT_EQ((numbers{group->service_flags, group->mask_bits, group->compat_mode, group->state_flags,
                        group->hia_timer.countdown, group->hia_timer.period, group->monitor_timer.countdown}),
-              (numbers{7, 6, 1, 1, 0x9, 7, 1, WCCP_STATE_INIT, 1, 10, 5}));
+              (numbers{0x9, 7, 1, WCCP_STATE_INIT, 1, 10, 5}));
     EXPECT_EQ(memcmp(group->password, "12345678", 8), 0);
     EXPECT_EQ(group->appliance_ipa, ipa("10.0.0.100"));
     EXPECT_EQ(wccp_find_group(61 + 256), group);
@@ -124,12 +120,12 @@ TEST_F(Config, ARecordIsTakenOverFieldByField) {
     EXPECT_EQ(wccp_g.group_list->id, 62) << "newest first";
     EXPECT_EQ(wccp_find_group(62)->compat_mode, 2u);
 
-    // What cannot be added changes nothing.
+    // A group that cannot be added changes nothing.
     EXPECT_EQ(wccp_add_group(nullptr), 1);
     EXPECT_EQ(wccp_add_group(&with), 1);
     EXPECT_EQ(wccp_find_group(61), group);
     EXPECT_EQ(wccp_del_group(60), 1);
-    memset(other.interface, 'x', sizeof other.interface); // no end of text
+    memset(other.interface, 'x', sizeof other.interface); // not terminated
     other.group_id = 63;
     EXPECT_STREQ(add(other)->interfaces[0]->name, "xxxxxxxxxxxxxxx");
 }
@@ -154,11 +150,11 @@ TEST_F(Config, AMulticastGroupWaitsForAnAddress) {
 }
 
 TEST_F(Config, AGroupStartsAsFarAsItCan) {
-    // Enabled, on an interface that isn't ready: the connectivity alarm alone runs.
+    // Enabled, on an interface that is not ready: only the connectivity alarm runs.
     const wccp_service_group *waiting = add(config(10, "absent0"));
     EXPECT_EQ(waiting->hia_timer.active + waiting->monitor_timer.active, 0);
     EXPECT_EQ(waiting->router_alarm_timer.active, 1);
-    // Disabled, or nothing said: no timer runs.
+    // Disabled, or not configured: no timer runs.
     for (const uint32_t admin : {WCCP_ADMIN_DOWN + 0u, 0u}) {
         wccp_grp_config with = config(static_cast<uint8_t>(11 + admin));
         with.admin = admin;
@@ -183,81 +179,62 @@ TEST_F(Config, DisablingStopsOnceAndEnablingStartsOnce) {
         EXPECT_EQ(group->admin_state, step.state);
         EXPECT_EQ(group->change_number, step.changes ? 0u : 5u);
         EXPECT_EQ(group->hia_timer.active, step.state == 1 ? 1 : 0);
-        EXPECT_EQ(modify(99, WCCP_CFG_ADMIN, update), 0) << "a group that isn't there is no failure here";
+        EXPECT_EQ(modify(99, WCCP_CFG_ADMIN, update), 0) << "a missing group is not a failure here";
     }
 }
 
-TEST_F(Config, EachUpdateChangesItsOneField) {
+// tests/daemon_config_test.cpp has the update of each field.
+TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
     wccp_grp_config fill = {};
     fill.admin = WCCP_ADMIN_UP;
     fill.weight = 7;
-    memcpy(fill.password, "secret", 6);
-    fill.fwd_method = fill.force_l2_return = 1;
-    fill.assign_method = 2;
-    fill.hash_src_ip = fill.hash_dst_ip = fill.hash_src_port = fill.hash_dst_port = 1;
+    fill.hash_src_ip = fill.hash_dst_ip = 1;
     fill.mask_src_ip = 0x3;
-    fill.mask_dst_ip = 0x7;
-    fill.mask_src_port = 0xf;
     fill.mask_dst_port = 0x1f;
+    memcpy(fill.password, "secret", 6);
     const wccp_service_group *group = add(config(61));
-    const auto now = [group] {
-        return numbers{group->weight,          group->security_option,   group->cfg_fwd_method,
-                       group->force_l2_return, group->cfg_assign_method, group->service_flags,
-                       group->mask_bits,       group->compat_mode};
-    };
-    enum { WEIGHT, SECURITY, FORWARD, L2_RETURN, ASSIGN, HASH, MASK, COMPAT, NOTHING };
     const struct {
         uint32_t flags;
-        int field;
-        uint32_t value;
+        uint32_t weight, service_flags, mask_bits; // afterwards
         const char *refusal = "";
     } rows[] = {
-        {WCCP_CFG_ADMIN | WCCP_CFG_WEIGHT, NOTHING, 0}, // of several, the first in order acts
-        {WCCP_CFG_WEIGHT | WCCP_CFG_COMPATIBILITY, WEIGHT, 7},
-        {WCCP_CFG_PASSWORD, SECURITY, 1},
-        {WCCP_CFG_FWD_METHOD, FORWARD, 1},
-        {WCCP_CFG_FORCE_L2_RETURN, L2_RETURN, 1},
-        {WCCP_CFG_ASSIGN_METHOD, ASSIGN, 2},
-        {WCCP_CFG_HASH_SRC_IP | WCCP_CFG_HASH_DST_IP, NOTHING, 0, "wccp_set_hash: unknown config_flag 0x300"},
-        {WCCP_CFG_HASH_DST_PORT | WCCP_CFG_COMPATIBILITY, NOTHING, 0, "unknown config_flag 0x880"},
-        {WCCP_CFG_HASH_SRC_IP, HASH, 1},
-        {WCCP_CFG_HASH_DST_IP, HASH, 3},
-        {WCCP_CFG_HASH_SRC_PORT, HASH, 7},
-        {WCCP_CFG_HASH_DST_PORT, HASH, 15},
-        {WCCP_CFG_MASK_SRC_IP | WCCP_CFG_MASK_DST_IP, NOTHING, 0,
-         "wccp_set_mask: unknown config_flag 0x3000"},
-        {WCCP_CFG_MASK_DST_PORT | WCCP_CFG_ROUTERS, NOTHING, 0, "unknown config_flag 0x8001"},
-        {WCCP_CFG_MASK_SRC_IP, MASK, 2},
-        {WCCP_CFG_MASK_DST_IP, MASK, 5},
-        {WCCP_CFG_MASK_SRC_PORT, MASK, 9},
-        {WCCP_CFG_MASK_DST_PORT, MASK, 14},
-        {WCCP_CFG_COMPATIBILITY, COMPAT, 0},
+        {WCCP_CFG_ADMIN | WCCP_CFG_WEIGHT, 100, 0, 0}, // of several, the first in order acts
+        {WCCP_CFG_WEIGHT | WCCP_CFG_COMPATIBILITY, 7, 0, 0},
+        {WCCP_CFG_HASH_SRC_IP | WCCP_CFG_HASH_DST_IP, 7, 0, 0, "wccp_set_hash: unknown config_flag 0x300"},
+        {WCCP_CFG_HASH_DST_PORT | WCCP_CFG_COMPATIBILITY, 7, 0, 0, "unknown config_flag 0x880"},
+        {WCCP_CFG_HASH_DST_IP, 7, 2, 0},
+        {WCCP_CFG_MASK_SRC_IP | WCCP_CFG_MASK_DST_IP, 7, 2, 0, "wccp_set_mask: unknown config_flag 0x3000"},
+        {WCCP_CFG_MASK_DST_PORT | WCCP_CFG_ROUTERS, 7, 2, 0, "unknown config_flag 0x8001"},
+        {WCCP_CFG_MASK_DST_PORT, 7, 2, 5},
+        {WCCP_CFG_MASK_SRC_IP, 7, 2, 7},
+        {WCCP_CFG_PASSWORD, 7, 2, 7},
+        {WCCP_CFG_FWD_METHOD, 7, 2, 7},
+        {WCCP_CFG_FORCE_L2_RETURN, 7, 2, 7},
+        {WCCP_CFG_ASSIGN_METHOD, 7, 2, 7},
+        {WCCP_CFG_COMPATIBILITY, 7, 2, 7},
     };
     log_lines log;
-    numbers expected = {100, 0, 2, 0, 3, 0, 0, 1};
     for (const auto &row : rows) {
         SCOPED_TRACE(row.flags);
         log.take();
-        if (row.field != NOTHING)
-            expected[static_cast<size_t>(row.field)] = row.value;
         EXPECT_EQ(modify(61, row.flags, fill), row.refusal[0] ? 1 : 0);
-        EXPECT_EQ(now(), expected);
+        EXPECT_EQ((numbers{group->weight, group->service_flags, group->mask_bits}),
+                  (numbers{row.weight, row.service_flags, row.mask_bits}));
         EXPECT_TRUE(log.say(row.refusal));
         EXPECT_EQ(modify(99, row.flags, fill), row.flags & WCCP_CFG_ADMIN ? 0 : 1);
         EXPECT_TRUE(log.say("WCCP GRP 99 "));
     }
+    EXPECT_EQ(group->compat_mode + group->cfg_fwd_method + group->cfg_assign_method, 0u);
     EXPECT_EQ(memcmp(group->password, "secret\0\0", 8), 0);
     EXPECT_EQ(modify(61, WCCP_CFG_PASSWORD), 0);
-    EXPECT_EQ(group->security_option, 0u);
-    EXPECT_EQ(memcmp(group->password, "\0\0\0\0\0\0\0\0", 8), 0);
+    EXPECT_TRUE(group->security_option == 0 && memcmp(group->password, "\0\0\0\0\0\0\0", 8) == 0);
     EXPECT_EQ(modify(61, WCCP_CFG_HASH_DST_IP), 0);
-    EXPECT_EQ(group->service_flags, 0xdu);
-    EXPECT_EQ(modify(99, WCCP_CFG_ROUTERS, fill), 0);
-    EXPECT_EQ(modify(99, 0, fill), 0);
+    EXPECT_EQ(group->service_flags, 0u);
+    EXPECT_EQ(modify(99, WCCP_CFG_ROUTERS, fill) + modify(99, 0, fill), 0);
     EXPECT_EQ(wccp_modify_grp(nullptr), 1);
 }
 
-TEST_F(Config, AStopSaysFarewellAndForgetsAllButTheConfiguration) {
+TEST_F(Config, AStopSendsAShutdownMessageAndKeepsTheConfiguration) {
     wccp_grp_config with = config(61);
     with.mask_src_ip = 0xf;
     wccp_service_group *group = add(with);
@@ -275,10 +252,10 @@ TEST_F(Config, AStopSaysFarewellAndForgetsAllButTheConfiguration) {
     group->appliance_view_count++;
 
     wccp_stop_service_group(group);
-    const bytes farewell = engine.sent_to("10.0.0.2");
-    ASSERT_GE(farewell.size(), 20u);
-    EXPECT_EQ(farewell[3], 10) << "a Here-I-Am";
-    EXPECT_EQ(bytes(farewell.end() - 12, farewell.end()), (bytes{0, 15, 0, 8, 0, 1, 0, 4, 10, 0, 0, 100}));
+    const bytes shutdown = engine.sent_to("10.0.0.2");
+    ASSERT_GE(shutdown.size(), 20u);
+    EXPECT_EQ(shutdown[3], 10) << "a Here-I-Am";
+    EXPECT_EQ(bytes(shutdown.end() - 12, shutdown.end()), (bytes{0, 15, 0, 8, 0, 1, 0, 4, 10, 0, 0, 100}));
     EXPECT_EQ(group->hia_timer.active + group->assign_timer.active + group->monitor_timer.active, 0);
     EXPECT_EQ((numbers{group->state_flags, group->fwd_method, group->assign_method, group->ret_method,
                        group->designated, group->change_number, group->dsg_key_change, group->pending_acks,
@@ -290,11 +267,11 @@ TEST_F(Config, AStopSaysFarewellAndForgetsAllButTheConfiguration) {
     EXPECT_TRUE(group->router_alarm_timer.active == 1 && group->router_alarm_timer.countdown == 60);
 
     wccp_stop_service_group(group);
-    EXPECT_EQ(engine.sent_to("10.0.0.2"), bytes{}) << "nothing to take back a second time";
+    EXPECT_EQ(engine.sent_to("10.0.0.2"), bytes{}) << "nothing to withdraw a second time";
     EXPECT_EQ(group->tx_here_i_am, 1u);
 }
 
-TEST_F(Config, ADeletedGroupSaysFarewellUnlessItIsInInit) {
+TEST_F(Config, ADeletedGroupSendsAShutdownMessageUnlessItIsInInit) {
     for (uint32_t id = 0; id < WCCP_MAX_GROUPS; id++)
         add(config(static_cast<uint8_t>(id)));
     tables_agree();
@@ -310,10 +287,10 @@ TEST_F(Config, ADeletedGroupSaysFarewellUnlessItIsInInit) {
     EXPECT_EQ(wccp_del_group(3 + 256), 0);
     EXPECT_EQ(wccp_del_all_groups(), 0);
     for (const uint8_t id : {uint8_t{3}, uint8_t{0}, uint8_t{5}, uint8_t{255}})
-        EXPECT_EQ(engine.sent_to("10.0.0.2").at(8 + 8 + 5), id) << "by rising id";
+        EXPECT_EQ(engine.sent_to("10.0.0.2").at(8 + 8 + 5), id) << "in ascending order of ids";
 }
 
-TEST_F(Config, StoppingAllLeavesTheDisabledAlone) {
+TEST_F(Config, StoppingAllSkipsDisabledGroups) {
     wccp_service_group *up = add(config(1)), *down = add(config(2)), *unset = add(config(3));
     down->admin_state = WCCP_ADMIN_DOWN;
     unset->admin_state = 0;
@@ -340,8 +317,8 @@ TEST_F(Config, StoppingAllLeavesTheDisabledAlone) {
     EXPECT_TRUE(unset->admin_state == WCCP_ADMIN_UP && unset->hia_timer.active == 1);
 }
 
-// What the monitoring tree's own tests can't see of the answers that it gives.
-TEST_F(Config, WhatIsUnknownIsCalledSoAndWhatIsAbsentLeavesTheRecord) {
+// What the tests of the monitoring tree cannot see of the queries.
+TEST_F(Config, QueriesForUnknownValuesAndAbsentRecords) {
     wccp_service_group *group = add(config(61));
     wccp_g.seconds = 100;
     group->state_time = 40;

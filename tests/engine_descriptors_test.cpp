@@ -1,5 +1,5 @@
-// Descriptors that change hands between a receiver's wait and its read. The program's own poll replaces
-// that of the C library, so that the change comes at the very moment.
+// Descriptors that change between a receiver's wait and its read. A poll of this program replaces the C
+// library's, so that the change happens exactly there.
 
 #include <csignal>
 #include <functional>
@@ -15,7 +15,7 @@
 #include "engine/wccp_packet_io.h"
 #include "tests/support/engine_fixture.h"
 
-static std::function<void()> after_wait; // once, when something is ready
+static std::function<void()> after_wait; // called once, when a descriptor is ready
 
 extern "C" int poll(pollfd *fds, nfds_t count, int wait_ms) {
     const timespec limit = {wait_ms / 1000, wait_ms % 1000 * 1000000L};
@@ -30,7 +30,7 @@ namespace {
 class Descriptors : public testing::Test {
 protected:
     void SetUp() override {
-        // A read that blocks; the first process of its namespace dies of no signal that it doesn't handle.
+        // Ends a read that blocks. The first process of a namespace only receives signals that it handles.
         signal(SIGALRM, [](int) { _exit(1); });
         alarm(20);
         send_datagram(engine.router_socket("10.0.0.2"), "10.0.0.100", WCCP_PORT, {1, 2, 3, 4});
@@ -42,7 +42,7 @@ protected:
     wccp_pkt pkt = {};
 };
 
-TEST_F(Descriptors, WhatIsAnothersNowStaysUnread) {
+TEST_F(Descriptors, ADescriptorOfAnotherFileIsNotRead) {
     int other = -1;
     after_wait = [&] {
         const int number = wan->ucast_fd;
@@ -59,7 +59,7 @@ TEST_F(Descriptors, WhatIsAnothersNowStaysUnread) {
     close(other);
 }
 
-TEST_F(Descriptors, ANewSocketWithNothingInItHoldsNobodyUp) {
+TEST_F(Descriptors, ANewSocketThatIsEmptyDoesNotBlock) {
     after_wait = [&] { EXPECT_EQ(wccp_init_network_by_interface(wan), 0); };
     EXPECT_LT(wccp_rx_pkt(wan, &pkt, sizeof pkt.data), 1);
     EXPECT_EQ(after_wait, nullptr);

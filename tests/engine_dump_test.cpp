@@ -1,5 +1,5 @@
-// The dumps that an operator reads: the whole text of a small group as it has to stand, and every way in
-// which a buffer can be too small for it.
+// The diagnostic dumps: the whole text of a small group, compared with a file, and buffers of every size that
+// is too small.
 #include "engine/wccp_debug_utils.h"
 
 #include <gtest/gtest.h>
@@ -18,7 +18,7 @@
 
 namespace {
 
-// The texts as an operator has them, each after a line with its name.
+// The expected texts, each after a line with its name.
 const std::map<std::string, std::string> golden = [] {
     std::ifstream file(WCCP_SOURCE_DIR "/tests/golden/engine_dumps.txt");
     std::map<std::string, std::string> found;
@@ -66,7 +66,7 @@ int print_assignment_51(csys_display_buf *buffer) {
     return wccp_print_service_grp_assignment_details(51, buffer);
 }
 
-// Group 51 as the texts above have it.
+// Group 51 as in the expected texts.
 struct EngineDump : testing::Test, reported_group {
     EngineDump() : reported_group(false) {
         wccp_g.seconds = 200000;
@@ -180,15 +180,15 @@ TEST_F(EngineDump, AGroupThatDoesNotExist) {
     EXPECT_TRUE(log.say("WCCP GRP 7: show assignment: cannot find group id 7"));
 }
 
-TEST_F(EngineDump, WhatTheDesignatorComputed) {
+TEST_F(EngineDump, TheDesignatedAppliancesTable) {
     const auto text = [] { return dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text; };
-    // Alone with all buckets.
+    // One appliance with all buckets.
     group->dsg_active_count = 1;
     std::fill(group->bucket_ipa, group->bucket_ipa + WCCP_MAX_BUCKETS, US);
     const std::string full = "\t                           : 0xffffffff ffffffff ffffffff ffffffff\n";
     EXPECT_NE(text().find(full + full + "\n"), std::string::npos);
 
-    // Masks in place of buckets.
+    // Mask values instead of buckets.
     group->assign_method = WCCP_ASSIGN_MASK;
     group->cfg_assign_method = 4;
     group->dsg_appliances[0].assigned = 2;
@@ -202,14 +202,14 @@ TEST_F(EngineDump, WhatTheDesignatorComputed) {
     head.replace(head.rfind("hash"), 4, "mask");
     EXPECT_EQ(text(), head + MASK_TEXT + MASK_ROUTERS);
 
-    // Another's computation isn't shown, what the routers report still is; no buckets make no share.
+    // Not designated: only the routers' reports are shown. No buckets give 0 %.
     group->designated = 0;
     first->view_appliances[0].buckets_total = 0;
     std::string shareless = MASK_ROUTERS;
     shareless.replace(shareless.find("25 %"), 4, "0 %");
     EXPECT_EQ(text(), head + "\n\tDesignator allocation      : not the designator \n\n" + shareless);
 
-    // Nothing agreed: neither rows of buckets nor of values.
+    // No method agreed: no rows of buckets or values.
     group->assign_method = WCCP_ASSIGN_NONE;
     EXPECT_NE(text().find("Negotiated assign. method  : not set\n"), std::string::npos);
     EXPECT_EQ(text().find("Rxed "), std::string::npos);
@@ -250,14 +250,14 @@ TEST_F(EngineDump, WordsForOtherStates) {
     EXPECT_EQ(row("WCCP state flags"), "0x17 = { INIT BACKUP ACTIVE DESG_ELECT_PENDING  }");
 }
 
-// However small the buffer: the beginning of the text, closed by a newline, and the result 1.
-TEST_F(EngineDump, EverySizeThatIsTooSmall) {
+// Each gives the beginning of the text, a newline and the result 1.
+TEST_F(EngineDump, EveryBufferThatIsTooSmall) {
     for (const auto print : {wccp_print_global, wccp_print_all_wccp_info, print_51, print_assignment_51}) {
         const dump whole = dump_of(WCCP_DUMP_ALL_BYTES, print);
         ASSERT_EQ(whole.result, 0);
         const uint32_t overhead = WCCP_DUMP_ALL_BYTES - whole.max;
         const auto length = static_cast<uint32_t>(whole.text.size());
-        // The closing line is shorter with a smaller buffer: 24 bytes less are surely too few.
+        // The closing line is shorter with a smaller buffer; 24 bytes less are certainly too few.
         for (uint32_t max = 1; max < length - 24; max += max + 300 < length ? 23 : 1) {
             const dump cut = dump_of(max + overhead, print);
             ASSERT_EQ(cut.result, 1) << max;
@@ -268,7 +268,7 @@ TEST_F(EngineDump, EverySizeThatIsTooSmall) {
     }
 }
 
-TEST_F(EngineDump, WhatTheLogSaysOfAFullBuffer) {
+TEST_F(EngineDump, LogLinesOfAFullBuffer) {
     log_lines log;
     const auto says = [&log](uint32_t size, int (*print)(csys_display_buf *),
                              std::vector<std::string> lines) {

@@ -1,4 +1,4 @@
-// wccpd and tunneld at the mailbox, each on threads of its own.
+// wccpd and tunneld at the mailbox, on separate threads.
 
 #include "engine/wccpd_common.h"
 
@@ -57,7 +57,7 @@ struct Mailbox : testing::Test {
 
 } // namespace
 
-// The C library's, in their place: a wait can take no time, and the clock can be moved on.
+// Replace the C library's: a wait can take no time, and the clock can be advanced.
 extern "C" int poll(pollfd *fds, nfds_t count, int ms) {
     if (count != 0 || !no_waiting)
         return static_cast<int>(syscall(SYS_poll, fds, count, ms));
@@ -73,8 +73,8 @@ extern "C" int clock_gettime(clockid_t clock, timespec *out) noexcept {
     return static_cast<int>(result);
 }
 
-// First of all, while this process has no mailbox: the two wccpd run in children with shared memory of their
-// own.
+// The first test, because this process must not have a mailbox yet. Both wccpd run in children with shared
+// memory of their own.
 TEST(SecondWccpd, TouchesNothingOfTheFirst) {
     const pid_t second = fork();
     if (second == 0) {
@@ -117,7 +117,7 @@ TEST(SecondWccpd, TouchesNothingOfTheFirst) {
 }
 
 #ifndef WCCP_SANITIZED
-// Before any thread has run: the memory that one leaves free would do for the table.
+// Before any thread has run: memory that a thread has freed could hold the table.
 TEST_F(Mailbox, WithoutMemoryAMembershipIsRefusedAndTheRestStays) {
     const uint8_t id = 9;
     rlimit before;
@@ -132,7 +132,8 @@ TEST_F(Mailbox, WithoutMemoryAMembershipIsRefusedAndTheRestStays) {
         ASSERT_EQ(wccp_check_policy_group(policy, id), policy < refused);
     wccp_set_role(id, 0);
     EXPECT_EQ(wccp_get_role(refused), 2u);
-    EXPECT_EQ(wccp_get_role(static_cast<uint16_t>(refused - 1)), 0u) << "it follows the last that took it";
+    EXPECT_EQ(wccp_get_role(static_cast<uint16_t>(refused - 1)), 0u)
+        << "it follows the last one that accepted it";
     EXPECT_EQ(wccp_add_policy_grp(refused, 1, &id), 0) << "with memory again";
 }
 #endif
@@ -159,7 +160,7 @@ TEST_F(Mailbox, AnswersComeBackAsTheyWereGiven) {
         EXPECT_EQ(wccp_set_L2_return(255, 0xABCD1234), row.other);
         const std::vector<seen_command> given = tunneld.take_commands();
         ASSERT_EQ(given.size(), 3u);
-        const uint8_t group = given[0].l2_group; // what is no input of a command stays as it is
+        const uint8_t group = given[0].l2_group; // what is not an input of a command is unchanged
         const uint32_t value = given[0].l2_value, last = row.index;
         EXPECT_EQ(given, (std::vector<seen_command>{
                              {2, 300, 0x0A000001, 0xFFFFFFFE, WCCP_NO_INDEX, group, value},
@@ -169,8 +170,8 @@ TEST_F(Mailbox, AnswersComeBackAsTheyWereGiven) {
     }
 }
 
-// Nobody answers. What is waited for takes 2000 polls.
-TEST_F(Mailbox, ASilentTunneldIsWaitedForOnceInAWhile) {
+// No answers. A wait takes 2000 polls.
+TEST_F(Mailbox, ATunneldThatDoesNotAnswerIsTriedAgainAfterTenSeconds) {
     uint32_t index = 42;
     const auto add = [&] { return wccp_add_tunnel_encap(9, address(1), address(2), &index); };
     const auto remove = [&] { return wccp_del_tunnel_encap(9, address(1), address(2), &index); };
@@ -196,7 +197,7 @@ TEST_F(Mailbox, ASilentTunneldIsWaitedForOnceInAWhile) {
         {nullptr, remove, 0, MAILBOX_DELETE_TUNNEL, no_line},
         {nullptr, add, 0, MAILBOX_DELETE_TUNNEL, add_line},
         {clear_slot, add, 2000, MAILBOX_IDLE, add_line},
-        {nullptr, add, 0, MAILBOX_IDLE, add_line}, // an add leaves nothing in the slot to be cleared
+        {nullptr, add, 0, MAILBOX_IDLE, add_line}, // a withdrawn add leaves nothing to clear
         {later(9), l2_return, 0, MAILBOX_IDLE, l2_line},
         {later(1), l2_return, 2000, MAILBOX_L2_RETURN, l2_line},
         {later(9), add, 0, MAILBOX_L2_RETURN, add_line},
@@ -226,7 +227,7 @@ TEST_F(Mailbox, ASilentTunneldIsWaitedForOnceInAWhile) {
         const std::string said = log.take();
         EXPECT_TRUE(step.line.empty() ? said.empty() : said.find(step.line) != std::string::npos) << said;
     }
-    // An add is refused for each packet of a new router. They come as fast as the network brings them.
+    // Each packet of a new router causes an add. Their complaints are limited.
     wccp_interface wan0 = {};
     const wccp_complaint_scope complaints(&wan0);
     int lines = 0;
@@ -238,11 +239,11 @@ TEST_F(Mailbox, ASilentTunneldIsWaitedForOnceInAWhile) {
     polls = 0;
     later(10)();
     late_answer();
-    EXPECT_EQ(add(), 0) << "and nothing is refused in the tests that follow";
+    EXPECT_EQ(add(), 0) << "for the tests that follow";
     no_waiting = false;
 }
 
-// A writer that gives up and replaces its command all the time, as wccpd does after two seconds.
+// A writer that replaces its command all the time, as wccpd does after a time-out.
 TEST_F(Mailbox, AReplacedCommandIsNeverReadHalf) {
     std::atomic<bool> stop = false;
     std::thread writer([&] {
@@ -254,7 +255,7 @@ TEST_F(Mailbox, AReplacedCommandIsNeverReadHalf) {
             mailbox_put(wccp_mailbox->remote_ip, value);
             mailbox_put(wccp_mailbox->fmst_index, value);
             wccp_mailbox->command.store(static_cast<uint16_t>(1 + i % 2), std::memory_order_release);
-            // Several in the time of one read, then long enough for one.
+            // Several within one read, then one for long enough.
             const auto next = std::chrono::steady_clock::now() + (i % 8 ? 0us : 40us);
             while (std::chrono::steady_clock::now() < next)
                 ;
@@ -291,18 +292,18 @@ TEST_F(Mailbox, AResetEndsAWaitWithoutAnAnswer) {
             std::thread add(
                 [&] { results[0] = wccp_add_tunnel_encap(9, address(1), address(2), &indices[0]); });
             tunneld.wait_for_command();
-            std::thread behind(
+            std::thread queued(
                 [&] { results[1] = wccp_del_tunnel_encap(9, address(1), address(2), &indices[1]); });
             wccp_cleanup_shmem();
             add.join();
             tunneld.answer_with(tunneld_does);
-            behind.join();
+            queued.join();
         });
         EXPECT_EQ(results[0], 1);
         EXPECT_EQ(indices[0], 42u);
         EXPECT_LT(took, 1.5);
         uint32_t index = 3;
-        EXPECT_EQ(wccp_del_tunnel_encap(9, address(1), address(2), &index), 0) << "commands work after it";
+        EXPECT_EQ(wccp_del_tunnel_encap(9, address(1), address(2), &index), 0) << "later commands work";
         EXPECT_EQ(index, 1009u);
     }
 }
@@ -314,12 +315,12 @@ TEST_F(Mailbox, APolicyGroupIsActiveOnlyWhenAllItsMembersAre) {
         uint32_t role;
     } steps[] = {
         {[] { return wccp_add_policy_grp(300, 0, nullptr); }, 2},
-        {[&] { return wccp_add_policy_grp(300, 3, members); }, 1}, // an unknown member counts like a backup
+        {[&] { return wccp_add_policy_grp(300, 3, members); }, 1}, // UNKNOWN counts like BACKUP
         {[] { return wccp_set_role(0, 0) + wccp_set_role(9, 0); }, 1},
         {[] { return wccp_set_role(255, 0); }, 0},
         {[] { return wccp_set_role(0, 1); }, 1},
         {[] { return wccp_remove_policy_grp(300, 0); }, 0},
-        {[] { return wccp_set_role(0, 1); }, 0}, // no member any more
+        {[] { return wccp_set_role(0, 1); }, 0}, // not a member any more
         {[] { return wccp_remove_policy_grp(300, 9); }, 0},
         {[] { return wccp_remove_policy_grp(300, 255); }, 2},
     };
@@ -334,7 +335,7 @@ TEST_F(Mailbox, AServiceGroupFollowsItsLastPolicyGroup) {
     wccp_set_role(id, 0);
     wccp_add_policy_grp(1, 1, &id);
     wccp_add_policy_grp(65535, 1, &id);
-    EXPECT_EQ(wccp_check_policy_group(1, id), 1) << "the bit stays";
+    EXPECT_EQ(wccp_check_policy_group(1, id), 1) << "the bit remains";
     EXPECT_EQ(wccp_check_policy_group(65535, id), 1);
     wccp_set_role(id, 1);
     EXPECT_EQ(wccp_get_role(1), 0u);
@@ -342,8 +343,8 @@ TEST_F(Mailbox, AServiceGroupFollowsItsLastPolicyGroup) {
     wccp_del_entire_policy_grp(1);
     EXPECT_EQ(wccp_get_role(1), 2u);
     wccp_set_role(id, 0);
-    EXPECT_EQ(wccp_get_role(65535), 1u) << "the delete took its policy group from it";
-    // Policy group 0 can have members, and doesn't follow them.
+    EXPECT_EQ(wccp_get_role(65535), 1u) << "since the delete it has no policy group";
+    // Policy group 0 can have members but does not follow them.
     wccp_add_policy_grp(0, 1, &id);
     EXPECT_EQ(wccp_get_role(0), 0u);
     wccp_set_role(id, 1);
@@ -364,9 +365,9 @@ TEST_F(Mailbox, AnyNumberOfPolicyGroupsKeepsItsMembers) {
     }
 }
 
-// Membership changes on the management thread while the engine's threads change roles; and the reset at exit,
-// after which tunneld sees no role that they bring.
-TEST_F(Mailbox, MembersAndRolesChangeAtOnce) {
+// Memberships change on the main thread while engine threads change roles. After the reset at exit, tunneld
+// sees only UNKNOWN.
+TEST_F(Mailbox, MembersAndRolesChangeConcurrently) {
     std::atomic<bool> stop = false;
     std::thread engine([&] {
         for (uint32_t i = 0; !stop; i++)
@@ -392,7 +393,7 @@ TEST_F(Mailbox, MembersAndRolesChangeAtOnce) {
         for (uint32_t policy = 0; policy < WCCP_POLICY_GROUPS; policy++)
             wrong += wccp_mailbox->policy_roles[policy].policy_group != policy ||
                      wccp_get_role(static_cast<uint16_t>(policy)) != 2;
-        const char zeroes[28] = {}; // the index, too
+        const char zeroes[28] = {}; // including the index
         EXPECT_EQ(memcmp(static_cast<void *>(wccp_mailbox), zeroes, sizeof zeroes), 0);
     }
     EXPECT_EQ(wrong, 0u);

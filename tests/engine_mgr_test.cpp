@@ -1,5 +1,4 @@
-// The manager: start and stop of the engine in either mode, the tick by hand, allocator and text helpers; and
-// the thread contexts under it.
+// Start and stop of the engine in both modes, the tick, allocation and text helpers, and the named threads.
 
 #include "engine/wccp_mgr.h"
 #include "engine/wccp_utils.h"
@@ -25,7 +24,7 @@
 #include "tests/support/engine_fixture.h"
 #include "tests/support/fake_tunneld.h"
 
-// The closed library's, in its place: refuses when told to, and never starts its thread here.
+// Replaces the platform's library: registration fails on request, and no thread is started.
 static bool registration_fails;
 int qv_register_netlink_notifier(uint32_t, qv_netlink_callback) {
     return registration_fails ? 5 : 0;
@@ -75,19 +74,19 @@ TEST_F(Manager, StartsThreadsMailboxAndPrimaryInterface) {
     EXPECT_EQ(wccp_find_group(1), nullptr);
 }
 
-TEST_F(Manager, ALinkManagerThatFailsIsNoFailure) {
+TEST_F(Manager, AFailingLinkManagerIsNotAFailure) {
     registration_fails = true;
     EXPECT_EQ(wccp_init_link_mgr(), 5);
     wccp_deinit_link_mgr();
     EXPECT_EQ(wccp_init_mgr(), 0);
 }
 
-TEST_F(Manager, InBridgeModeNobodyTicksButReceiversRun) {
+TEST_F(Manager, InBridgeModeThereAreReceiversButNoTicks) {
     test_host_bridge_mode = 1;
     ASSERT_EQ(wccp_init_mgr(), 0);
     EXPECT_EQ(threads_named("WCCP_RX_lo"), 1) << "an interface with an address has its receive thread";
     EXPECT_EQ(threads_named("WCCP_TIMER"), 0);
-    // A tick by hand: enabled groups only, and nothing once an exit has begun.
+    // A tick counts enabled groups only, and does nothing once the exit has begun.
     wccp_service_group *up = add_group(1, WCCP_ADMIN_UP), *down = add_group(2, WCCP_ADMIN_DOWN),
                        *unset = add_group(3, 0);
     unset->monitor_timer = down->monitor_timer = up->monitor_timer;
@@ -151,7 +150,7 @@ TEST(Text, SecondsBecomeDaysHoursMinutesSeconds) {
     wccp_seconds_to_str(1, nullptr, 128);
 }
 
-struct birth {
+struct observation {
     size_t stack = 0;
     sigset_t blocked;
     cpu_set_t cpus;
@@ -159,8 +158,8 @@ struct birth {
     void *ended = nullptr;
 };
 
-void *look_around(void *argument) {
-    auto *seen = static_cast<birth *>(argument);
+void *observe_thread(void *argument) {
+    auto *seen = static_cast<observation *>(argument);
     pthread_attr_t attributes;
     pthread_getattr_np(pthread_self(), &attributes);
     pthread_attr_getstacksize(&attributes, &seen->stack);
@@ -174,13 +173,13 @@ void *look_around(void *argument) {
 }
 
 void *note_end(void *argument) {
-    static_cast<birth *>(argument)->ended = argument;
+    static_cast<observation *>(argument)->ended = argument;
     return nullptr;
 }
 
-TEST(Thread, IsBornBoundSmallAndDeafToSignals) {
-    birth seen;
-    cthread *context = cthread_init(std::string(100, 'n').c_str(), look_around, &seen, note_end, &seen,
+TEST(Thread, HasItsNameStackSignalMaskAndCpu) {
+    observation seen;
+    cthread *context = cthread_init(std::string(100, 'n').c_str(), observe_thread, &seen, note_end, &seen,
                                     SCHED_OTHER, 3, 0, 7);
     ASSERT_NE(context, nullptr);
     EXPECT_EQ(strlen(context->name), 63u);
@@ -188,9 +187,9 @@ TEST(Thread, IsBornBoundSmallAndDeafToSignals) {
     EXPECT_TRUE(context->listed == 1 && context->heartbeat != 0);
     cthread_join(context);
     EXPECT_EQ(seen.runs, 1);
-    EXPECT_EQ(seen.ended, &seen) << "the end function ran behind the body";
+    EXPECT_EQ(seen.ended, &seen) << "the end function runs after the body";
     EXPECT_EQ(seen.nice, 3);
-#ifndef WCCP_SANITIZED // which needs more
+#ifndef WCCP_SANITIZED // the sanitizers need more
     EXPECT_LE(seen.stack, 132u * 1024);
 #endif
     for (const int number : {SIGHUP, SIGINT, SIGTERM, SIGPIPE, SIGUSR1, SIGUSR2})
@@ -198,16 +197,16 @@ TEST(Thread, IsBornBoundSmallAndDeafToSignals) {
     EXPECT_TRUE(CPU_COUNT(&seen.cpus) == 1 && CPU_ISSET(0, &seen.cpus));
     sigset_t own;
     pthread_sigmask(SIG_BLOCK, nullptr, &own);
-    EXPECT_EQ(sigismember(&own, SIGTERM), 0) << "the caller's mask is as it was";
+    EXPECT_EQ(sigismember(&own, SIGTERM), 0) << "the caller's mask is unchanged";
 
-    // A place that it cannot have doesn't stop it.
-    context = cthread_init("astray", look_around, &seen, nullptr, nullptr, SCHED_OTHER, 0, 128, 0);
+    // A CPU that does not exist does not prevent it from running.
+    context = cthread_init("astray", observe_thread, &seen, nullptr, nullptr, SCHED_OTHER, 0, 128, 0);
     ASSERT_EQ(cthread_start(context), 0);
     cthread_join(context);
     EXPECT_EQ(seen.runs, 2);
 }
 
-TEST(Thread, WithoutABodyOrAStartEnds) {
+TEST(Thread, WithoutABodyOrAStartItEnds) {
     const auto make = [](uint32_t policy) {
         return cthread_init("empty", nullptr, nullptr, nullptr, nullptr, policy, 0, 0, 0);
     };
@@ -228,7 +227,7 @@ void *sleep_for_ever(void *) {
         pause();
 }
 
-TEST(Thread, AllOfThemAreCancelledBeforeOneIsWaitedFor) {
+TEST(Thread, AllAreCancelledBeforeTheFirstIsJoined) {
     cthread *one = nullptr;
     for (int i = 0; i < 21; i++) {
         one = cthread_init("sleeper", sleep_for_ever, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);

@@ -1,6 +1,5 @@
-// Interfaces against real ones: a veth pair whose other end lies in a namespace of its own, where the routers
-// are. First the sockets, with datagrams read by hand; then the table, and what notifications make of it,
-// given by hand in every order that the kernel may choose.
+// Interfaces on a real veth pair, whose other end is in the routers' namespace: the sockets, the table of
+// interfaces, and notifications, called directly in each order that the kernel may choose.
 
 #include "engine/wccp_network.h"
 #include "engine/wccp_packet_io.h"
@@ -70,7 +69,7 @@ protected:
         fprintf(conf, "max_interfaces %u\n", LIMIT);
         fclose(conf);
     }
-    // A table entry without a receive thread: whoever reads does so by hand.
+    // A table entry without a receive thread.
     static wccp_interface *bare(const char *name) {
         wccp_interface *interface = &wccp_g.interfaces[wccp_g.if_count++];
         strlcpy(interface->name, name, sizeof interface->name);
@@ -84,7 +83,7 @@ protected:
         memset(pkt.data, fill, length);
         return pkt;
     }
-    // The interface's own receive thread takes over, and a router listens.
+    // The interface gets its receive thread, and there is a router.
     wccp_service_group *live_group(const std::vector<std::string> &routers = {"10.0.0.2"}) {
         wan->rx_thread = nullptr;
         engine.router_socket("10.0.0.2");
@@ -93,21 +92,21 @@ protected:
     static void make_active(wccp_service_group *known) {
         known->state_flags = (known->state_flags & ~WCCP_STATE_MASK) | WCCP_STATE_ACTIVE;
     }
-    static void tell_link(const char *name, uint32_t admin_up, uint32_t link_up) {
+    static void notify_link(const char *name, uint32_t admin_up, uint32_t link_up) {
         qv_if_state_info info = {};
         strlcpy(info.name, name, sizeof info.name);
         info.admin_up = admin_up;
         info.link_up = link_up;
         wccp_process_if_state_change(&info);
     }
-    static void set_address(const std::string &address) { // none: ""
+    static void set_address(const std::string &address) { // "" for none
         run_command("ip addr flush dev wan0");
         if (!address.empty())
             run_command("ip addr add " + address + "/24 dev wan0");
         wccp_process_if_ipa_update("wan0");
     }
 
-    engine_fixture engine; // whose sockets are open
+    engine_fixture engine; // wan0 has open sockets
     wccp_interface *wan = engine.interface;
     wccp_service_group group = {};
 };
@@ -138,7 +137,7 @@ TEST_F(Network, SocketsCarryTheirOptions) {
 
 TEST_F(Network, AFailedBindLeavesTheSocketOpenAndStopsAllSending) {
     const size_t descriptors = open_descriptors();
-    wan->ipa = ipa("10.9.9.9"); // nobody here has it
+    wan->ipa = ipa("10.9.9.9"); // not an address of this host
     EXPECT_EQ(wccp_init_network_by_interface(wan), 1);
     EXPECT_GE(wan->ucast_fd, 0);
     EXPECT_EQ(wan->ucast_bound, 0u);
@@ -161,7 +160,7 @@ size_t count_of(const std::string &text, const std::string &in) {
     return count;
 }
 
-// Whatever keeps a set-up from succeeding, it is tried again at each of these occasions, and at no other.
+// A set-up that failed, for either cause, is repeated on each of these occasions, and on no other.
 TEST_F(Network, AFailedSetUpIsTriedAgain) {
     const int port_owner = socket(AF_INET, SOCK_DGRAM, 0);
     sockaddr_in port = {};
@@ -171,7 +170,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
     const auto own_port = [&](bool on) {
         port.sin_port = on ? htons(2048) : 0;
         const int fd = socket(AF_INET, SOCK_DGRAM, 0);
-        // A receive thread in its wait keeps a closed socket for up to a second: shared with that one only.
+        // A waiting receive thread keeps a closed socket for up to a second: share the port only with that.
         for (const int shared : {1, 0}) {
             ASSERT_EQ(setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &shared, sizeof shared), 0);
             if (shared) {
@@ -209,11 +208,11 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
         std::function<void()> happens;
     } occasions[] = {
         {"thirty seconds", [&] { tick(30); }},
-        {"a link notification", [] { tell_link("wan0", 1, 1); }},
+        {"a link notification", [] { notify_link("wan0", 1, 1); }},
         {"the link comes",
          [] {
-             tell_link("wan0", 1, 0);
-             tell_link("wan0", 1, 1);
+             notify_link("wan0", 1, 0);
+             notify_link("wan0", 1, 1);
          }},
         {"an address notification", [] { wccp_process_if_ipa_update("wan0"); }},
         {"a group is created again",
@@ -237,7 +236,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
             EXPECT_EQ(wccp_init_network_by_interface(wan), 1);
             log.take();
             EXPECT_EQ(wccp_add_group(&multicast), 1);
-            EXPECT_EQ(count_of("WCCP: net init", log.take()), 0u) << "not twice in one second";
+            EXPECT_EQ(count_of("WCCP: net init", log.take()), 0u) << "one attempt in a second";
             EXPECT_EQ(take_reasons(wccp_find_group(62)), &cause == causes
                                                              ? "port-taken: Address already in use|wan0"
                                                              : "socket-failed: Too many open files|wan0");
@@ -252,7 +251,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
             tick(31);
             EXPECT_EQ(count_of("socket set-up of 10.0.0.100 succeeded after an earlier failure", log.take()),
                       1u);
-            // A group that could not join is started, and somebody receives.
+            // The group that could not join is started, and there is a receiver.
             EXPECT_EQ(wccp_find_group(62)->hia_timer.active, 1);
             EXPECT_EQ(take_reasons(wccp_find_group(62)), "");
             EXPECT_EQ(wan->mcast_bound_ipa, ipa("224.0.1.62"));
@@ -261,7 +260,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
         }
     close(port_owner);
 
-    // Nobody needs it.
+    // Not when no group needs it.
     known = wccp_find_group(61);
     wan->network_flaws = WCCP_FLAW_SOCKETS;
     struct stat before = {}, after = {};
@@ -275,7 +274,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
     tick(31);
     EXPECT_EQ(wan->network_flaws, WCCP_FLAW_SOCKETS + 0u);
 
-    // For a join alone no socket is opened again.
+    // For a failed join the sockets are kept.
     wan->ready_flags = WCCP_ALL_READY;
     wan->network_flaws = 0;
     EXPECT_EQ(wccp_add_group(&multicast), 0);
@@ -292,7 +291,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
 
 TEST_F(Network, JoiningBindsOnceAndRepeatsWithoutHarm) {
     EXPECT_EQ(wccp_join_mc_grp(bare("closed0"), ipa("224.0.1.5")), 1);
-    // The sockets outlive the address, but nothing is joined by whatever other interface the kernel finds.
+    // Without an address nothing is joined, since the kernel would choose another interface.
     wan->ipa = {};
     EXPECT_EQ(wccp_join_mc_grp(wan, ipa("224.0.1.5")), 1);
     EXPECT_EQ(wan->mcast_bound, 0u);
@@ -302,14 +301,15 @@ TEST_F(Network, JoiningBindsOnceAndRepeatsWithoutHarm) {
         EXPECT_EQ(wccp_join_mc_grp(wan, ipa(address)), 0);
     const std::string lines = log.take();
     EXPECT_EQ(count_of("are not received", lines), 1u) << lines;
-    EXPECT_EQ(count_of("is bound to 224.0.1.5, so datagrams sent to 224.0.1.6 are not received", lines), 1u) << lines;
+    EXPECT_EQ(count_of("is bound to 224.0.1.5, so datagrams sent to 224.0.1.6 are not received", lines), 1u)
+        << lines;
     EXPECT_EQ(wan->mcast_bound, 1u);
     EXPECT_EQ(bound_to(wan->mcast_fd).sin_addr.s_addr, address_word("224.0.1.5"));
     EXPECT_EQ(bound_to(wan->mcast_fd).sin_port, htons(2048));
     run_command("ip maddr show dev wan0 | grep -q 224.0.1.6");
     EXPECT_EQ(wccp_join_mc_grp(wan, ipa("10.0.0.1")), 1);
 
-    // A new pair of sockets joins what its groups want, and may be bound elsewhere.
+    // New sockets join the addresses of their groups, and can be bound to another one.
     wccp_service_group silent = {};
     wccp_if_add_group(&silent, wan);
     wccp_if_add_group(&group, wan);
@@ -320,11 +320,11 @@ TEST_F(Network, JoiningBindsOnceAndRepeatsWithoutHarm) {
     wan->groups = nullptr;
 }
 
-TEST_F(Network, TheTtlReachesEverySocketThatTakesIt) {
+TEST_F(Network, TheTtlIsSetOnEverySocket) {
     wccp_interface *bad = bare("bad0"), *closed = bare("closed0"), *last = bare("last0");
     bad->mcast_fd = open("/dev/null", O_RDONLY);
     ASSERT_EQ(wccp_init_network_by_interface(last), 0);
-    EXPECT_EQ(wccp_set_mcast_ttl(5), 0) << "in force already: no socket is touched";
+    EXPECT_EQ(wccp_set_mcast_ttl(5), 0) << "unchanged: no socket is touched";
     EXPECT_EQ(wccp_set_mcast_ttl(0x1ff), 1);
     EXPECT_EQ(wccp_g.mcast_ttl, 255);
     EXPECT_EQ(option(wan->mcast_fd, IP_MULTICAST_TTL), 255);
@@ -337,7 +337,7 @@ TEST_F(Network, TheTtlReachesEverySocketThatTakesIt) {
     EXPECT_EQ(option(wan->mcast_fd, IP_MULTICAST_TTL), 33);
 }
 
-TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
+TEST_F(Network, APacketIsSentToTheDestinationsOfTheGroup) {
     const std::vector<uint8_t> expected(120, 0x5a), nothing;
     for (const char *router : {"10.0.0.2", "10.0.0.3"})
         engine.router_socket(router);
@@ -353,7 +353,7 @@ TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
     EXPECT_EQ(wccp_tx_pkt(&group, nullptr), 0);
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 0) << "no interface";
     group.interfaces[0] = wan;
-    EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 0) << "nobody to send to";
+    EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 0) << "no destination";
     group.ucast_routers[group.ucast_router_count++] = ipa("10.0.0.2");
     group.ucast_routers[group.ucast_router_count++] = ipa("10.0.0.3");
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 240);
@@ -361,15 +361,15 @@ TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
     EXPECT_EQ(engine.sent_to("10.0.0.2"), expected);
     EXPECT_EQ(engine.sent_to("10.0.0.3"), expected);
     pkt.ipa = ipa("10.0.0.2");
-    EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 120) << "the packet's own address goes first";
+    EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 120) << "the packet's own address comes first";
     EXPECT_EQ(engine.sent_to("10.0.0.2"), expected);
 
-    // With a multicast address the unicast routers get nothing.
+    // With a multicast address nothing is sent to unicast routers.
     pkt.ipa = {};
     group.mcast_configured = 1;
     group.mcast_ipa = ipa("224.0.1.5");
     ASSERT_EQ(wccp_join_mc_grp(wan, group.mcast_ipa), 0);
-    const int32_t unicast = std::exchange(wan->ucast_fd, -1); // the other socket has TTL and interface
+    const int32_t unicast = std::exchange(wan->ucast_fd, -1); // the multicast socket is used
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 120);
     wan->ucast_fd = unicast;
     EXPECT_EQ(pkt.ipa, group.mcast_ipa);
@@ -379,7 +379,7 @@ TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
     for (const char *router : {"10.0.0.2", "10.0.0.3"})
         EXPECT_EQ(engine.sent_to(router), nothing);
 
-    // What sendto says is handed on, and added up in the loop.
+    // Results of sendto are returned, and added up over the routers.
     group.mcast_configured = 0;
     pkt.ipa = {};
     run_command("ip link set wan0 down");
@@ -390,11 +390,11 @@ TEST_F(Network, ThePacketGoesWhereTheGroupSays) {
     run_command("ip link set wan0 up");
     pkt.ipa = ipa("10.0.0.2");
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 120);
-    EXPECT_EQ(take_reasons(&group), "send-failed 10.0.0.3" + fault) << "sent: no reason any more";
+    EXPECT_EQ(take_reasons(&group), "send-failed 10.0.0.3" + fault) << "a successful send ends the reason";
 }
 
-// Addresses that nobody has: what is sent to them stays in the buffer while the kernel looks for them.
-TEST_F(Network, RoutersThatAreGoneHoldNobodyUp) {
+// Addresses that do not exist: datagrams stay in the send buffer while the kernel tries to resolve them.
+TEST_F(Network, RoutersThatAreGoneDoNotBlockSending) {
     ASSERT_EQ(wccp_init_network_by_interface(wan), 0);
     group.interfaces[0] = wan;
     group.ucast_router_count = 32;
@@ -418,14 +418,14 @@ TEST_F(Network, OneDatagramIsReadAtATimeAndTheMulticastSocketFirst) {
     send("10.0.0.100", 10, 1);
     send("224.0.1.5", 20, 2);
     for (pollfd each : {pollfd{wan->ucast_fd, POLLIN, 0}, pollfd{wan->mcast_fd, POLLIN, 0}})
-        ASSERT_EQ(poll(&each, 1, 5000), 1); // a busy kernel delivers later, and in any order
+        ASSERT_EQ(poll(&each, 1, 5000), 1); // on a busy system they arrive late, and in any order
     wccp_pkt pkt = {};
     EXPECT_EQ(wccp_rx_pkt(wan, &pkt, 4096), 20);
     EXPECT_EQ(pkt.ipa, ipa("10.0.0.3"));
     EXPECT_EQ(wccp_rx_pkt(wan, &pkt, 4096), 10);
     EXPECT_TRUE(pkt.data[0] == 1 && pkt.data[10] == 2);
 
-    // As long as the buffer, and longer: no byte after it is written.
+    // Of a datagram longer than the buffer, no byte after the buffer is written.
     send("10.0.0.100", 4096, 3);
     EXPECT_EQ(wccp_rx_pkt(wan, &pkt, 4096), 4096);
     EXPECT_EQ(pkt.data[4095], 3);
@@ -436,29 +436,6 @@ TEST_F(Network, OneDatagramIsReadAtATimeAndTheMulticastSocketFirst) {
     send("10.0.0.100", 3000, 5);
     EXPECT_EQ(wccp_rx_pkt(wan, &pkt, 100), 100);
     EXPECT_TRUE(pkt.data[99] == 5 && pkt.data[100] == 0);
-}
-
-TEST_F(Network, DescriptorsBeyondAThousandAreWaitedOn) {
-    rlimit limit = {};
-    getrlimit(RLIMIT_NOFILE, &limit);
-    const rlimit before = limit;
-    limit.rlim_cur = 2048;
-    if (setrlimit(RLIMIT_NOFILE, &limit) != 0)
-        GTEST_SKIP() << "no more than " << before.rlim_max << " descriptors here";
-    const int router = engine.router_socket("10.0.0.3");
-    wccp_close_sockets(wan);
-    std::vector<int> fillers;
-    while (fillers.empty() || fillers.back() < 1100)
-        fillers.push_back(open("/dev/null", O_RDONLY | O_CLOEXEC));
-    ASSERT_EQ(wccp_init_network_by_interface(wan), 0);
-    EXPECT_GT(wan->ucast_fd, 1023);
-    send_datagram(router, "10.0.0.100", 2048, std::vector<uint8_t>(10, 1));
-    wccp_pkt pkt = {};
-    EXPECT_EQ(wccp_rx_pkt(wan, &pkt, 4096), 10);
-    wccp_close_sockets(wan);
-    for (const int fd : fillers)
-        close(fd);
-    setrlimit(RLIMIT_NOFILE, &before);
 }
 
 TEST_F(Network, TheKernelIsAskedForAddressAndState) {
@@ -474,7 +451,7 @@ TEST_F(Network, TheKernelIsAskedForAddressAndState) {
     EXPECT_TRUE(is_zero(wccp_get_address("wan0")));
 }
 
-TEST_F(Network, TheTableGrowsToItsLimitAndKnowsNobodyTwice) {
+TEST_F(Network, TheTableGrowsToItsLimitAndHasEachNameOnce) {
     strlcpy(wccp_primary_wan_interface_name, "lo", sizeof wccp_primary_wan_interface_name);
     EXPECT_EQ(wccp_if_add_interface("wan0"), wan);
     const wccp_interface *lo = wccp_if_add_interface("lo");
@@ -508,16 +485,16 @@ TEST_F(Network, TheTableGrowsToItsLimitAndKnowsNobodyTwice) {
         interface.groups = nullptr;
 }
 
-TEST_F(Network, WhatConcernsNobodyIsIgnored) {
+TEST_F(Network, OtherNotificationsAreIgnored) {
     const wccp_interface before = *wan;
-    tell_link("other0", 0, 0);
+    notify_link("other0", 0, 0);
     wccp_process_if_ipa_update("other0");
     wccp_process_if_ipa_update(nullptr);
     wccp_process_if_state_change(nullptr);
-    tell_link("wan0", 1, 1); // up already
+    notify_link("wan0", 1, 1); // already up
     EXPECT_EQ(wccp_g.if_count, 1);
     wccpd_exiting = 1;
-    tell_link("wan0", 0, 0);
+    notify_link("wan0", 0, 0);
     set_address("10.0.0.7");
     EXPECT_EQ(memcmp(&before, wan, sizeof before), 0);
     wccpd_exiting = 0;
@@ -531,19 +508,19 @@ TEST_F(Network, TheLinkStopsAndStartsTheGroups) {
     wccp_service_group *known = live_group();
     EXPECT_EQ(known->hia_timer.active, 1);
     make_active(known);
-    tell_link("wan0", 1, 0); // up by its administrator, without a carrier
+    notify_link("wan0", 1, 0); // administratively up, without carrier
     EXPECT_TRUE(wan->link_up == 0 && wan->ready_flags == WCCP_IPA_READY);
     EXPECT_EQ(known->hia_timer.active, 0);
     EXPECT_EQ(known->state_flags, WCCP_STATE_INIT);
     EXPECT_EQ(take_reasons(known), "interface-down: |wan0");
-    tell_link("wan0", 0, 1);
-    tell_link("wan0", 0, 0);
+    notify_link("wan0", 0, 1);
+    notify_link("wan0", 0, 0);
     EXPECT_EQ(take_reasons(known), "interface-down: |wan0 x2");
     EXPECT_TRUE(wan->link_down_count == 1 && wan->stop_count == 1);
-    tell_link("wan0", 1, 1);
+    notify_link("wan0", 1, 1);
     EXPECT_EQ(wan->ready_flags, WCCP_ALL_READY);
     EXPECT_TRUE(known->hia_timer.active == 1 && known->hia_timer.countdown == 1);
-    EXPECT_TRUE(engine.sent_to("10.0.0.2").empty()) << "no farewell over a link that is gone";
+    EXPECT_TRUE(engine.sent_to("10.0.0.2").empty()) << "no shutdown message without a link";
     EXPECT_EQ(known->tx_link_drops, 1u);
 }
 
@@ -551,22 +528,22 @@ TEST_F(Network, AddressAndLinkInEitherOrderEndInReady) {
     const wccp_service_group *known = live_group();
     for (const bool link_first : {true, false}) {
         set_address("");
-        tell_link("wan0", 0, 0);
+        notify_link("wan0", 0, 0);
         EXPECT_EQ(wan->ready_flags, 0u);
         if (link_first)
-            tell_link("wan0", 1, 1);
+            notify_link("wan0", 1, 1);
         set_address("10.0.0.100");
         EXPECT_EQ(known->hia_timer.active, link_first ? 1 : 0);
-        tell_link("wan0", 1, 1);
+        notify_link("wan0", 1, 1);
         EXPECT_EQ(wan->ready_flags, WCCP_ALL_READY);
         EXPECT_EQ(known->hia_timer.active, 1);
         EXPECT_EQ(known->appliance_ipa, ipa("10.0.0.100"));
     }
 }
 
-// Deleted and made again while the notifier waited: what it reads when it gets the lock is the old
-// address.
-TEST_F(Network, AnInterfaceMadeAgainWithItsAddressIsJoinedAgain) {
+// The interface is deleted and created again while the notifier waits; the address that it then reads is the
+// same.
+TEST_F(Network, AnInterfaceCreatedAgainWithItsAddressJoinsAgain) {
     live_group({"224.0.1.61"});
     ASSERT_EQ(wan->mcast_bound, 1u);
     run_command("ip maddr show dev wan0 | grep -q 224.0.1.61");
@@ -580,11 +557,11 @@ TEST_F(Network, AnInterfaceMadeAgainWithItsAddressIsJoinedAgain) {
     run_command("ip maddr show dev wan0 | grep -q 224.0.1.61");
     const int32_t fd = wan->mcast_fd;
     wccp_process_if_ipa_update("wan0");
-    EXPECT_EQ(wan->mcast_fd, fd) << "the same device: nothing to open";
+    EXPECT_EQ(wan->mcast_fd, fd) << "the same device: its sockets are kept";
 }
 
-TEST_F(Network, AnAddressChangesGoesAndComes) {
-    // The shutdown message of the old address comes from the old socket, as long as the kernel lets it.
+TEST_F(Network, AnAddressIsChangedRemovedAndAdded) {
+    // The shutdown message is sent from the old socket and the old address, which lo still has.
     wccp_service_group *known = live_group();
     const auto last_word = [](const std::vector<uint8_t> &message) {
         return std::vector<uint8_t>(message.end() - 4, message.end());
@@ -592,10 +569,10 @@ TEST_F(Network, AnAddressChangesGoesAndComes) {
     make_active(known);
     run_command("ip addr add 10.0.0.100/32 dev lo");
     set_address("10.0.0.7");
-    const datagram farewell = receive_datagram(engine.sockets["10.0.0.2"]);
-    ASSERT_GE(farewell.bytes.size(), 12u);
-    EXPECT_EQ(farewell.from, "10.0.0.100");
-    EXPECT_EQ(last_word(farewell.bytes), (std::vector<uint8_t>{10, 0, 0, 100}));
+    const datagram shutdown_message = receive_datagram(engine.sockets["10.0.0.2"]);
+    ASSERT_GE(shutdown_message.bytes.size(), 12u);
+    EXPECT_EQ(shutdown_message.from, "10.0.0.100");
+    EXPECT_EQ(last_word(shutdown_message.bytes), (std::vector<uint8_t>{10, 0, 0, 100}));
     EXPECT_EQ(known->appliance_ipa, ipa("10.0.0.7"));
     EXPECT_EQ(known->state_flags, WCCP_STATE_INIT);
     EXPECT_EQ(known->hia_timer.active, 1);
@@ -606,7 +583,8 @@ TEST_F(Network, AnAddressChangesGoesAndComes) {
     make_active(known);
     const int32_t fd = wan->ucast_fd;
     set_address("");
-    EXPECT_TRUE(engine.sent_to("10.0.0.2").empty() && known->tx_link_drops == 1) << "no farewell is tried";
+    EXPECT_TRUE(engine.sent_to("10.0.0.2").empty() && known->tx_link_drops == 1)
+        << "no shutdown message is tried";
     EXPECT_TRUE(is_zero(known->appliance_ipa));
     EXPECT_EQ(known->hia_timer.active, 0);
     EXPECT_EQ(wan->ready_flags, WCCP_LINK_READY);

@@ -1,4 +1,4 @@
-// What the engine writes, byte by byte, against messages written out by hand.
+// Encoded messages, compared byte by byte with messages written by hand.
 
 #include "engine/wccp_pkt_load.h"
 
@@ -21,7 +21,7 @@ be32 ipa(uint8_t third, uint8_t fourth) {
     return {{10, 0, third, fourth}};
 }
 
-// A group with no engine around it, and one zeroed packet.
+// A group outside the engine's tables, and a zeroed packet.
 class Load : public testing::Test {
 protected:
     void SetUp() override {
@@ -87,8 +87,8 @@ TEST_F(Load, TheFirstHereIAmOfAStandardGroup) {
     EXPECT_EQ(pkt->offset, 108u);
 }
 
-// All that a Here-I-Am can hold. The digest is what md5sum gives for the password's eight bytes and this
-// message with sixteen zeros in its place.
+// Every component of a Here-I-Am. The digest was computed by md5sum over the 8 bytes of the password and this
+// message with 16 zero bytes in its place.
 TEST_F(Load, AFullHereIAmWithItsDigest) {
     group->id = 90;
     group->security_option = 1;
@@ -99,7 +99,7 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
     group->mask_dst_ip = 0xf00;
     group->mask_src_port = 0x21;
     group->mask_dst_port = 0x8001;
-    group->mask_in_use = {1, 2, 3, 4}; // not what is announced
+    group->mask_in_use = {1, 2, 3, 4}; // not sent
     group->state_flags = WCCP_STATE_ACTIVE | WCCP_SHUTTING_DOWN;
     add_routers(2);
     add_appliances(3);
@@ -114,7 +114,7 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
     ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
     EXPECT_EQ(loaded(), wire_message(10, {security, service, identity, view, capabilities, command}));
 
-    // All eight bytes of a password count, and so does all of the message.
+    // The digest covers all 8 bytes of the password and the whole message.
     const auto digest = [this] {
         clear();
         EXPECT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
@@ -127,7 +127,7 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
     EXPECT_NE(digest(), of_eight);
 }
 
-TEST_F(Load, CapabilitiesAreWhatDiffersFromTheDefaults) {
+TEST_F(Load, CapabilitiesListWhatDiffersFromTheDefaults) {
     const struct {
         uint32_t fwd, assign, ret;
         const char *expected;
@@ -202,7 +202,7 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
     } rows[] = {
         {1, 1, 1, 1, 1, 0, 0, 1},    {0, 1, 1, 1, 1, 1, 1, 1},
         {1, 0, 1, 1, 1, 1, 1, 1},    {1, 1, 0, 0, 1, 1, 1, 1},
-        {1, 1, 33, 129, 1, 1, 1, 1}, {1, 1, 1, 1, 0, 0, 1, 1}, // the view is asked of the mask form alone
+        {1, 1, 33, 129, 1, 1, 1, 1}, {1, 1, 1, 1, 0, 0, 1, 1}, // only the mask form needs the view
     };
     log_lines log;
     const auto text = [](uint32_t number) { return std::to_string(number); };
@@ -232,14 +232,14 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
             const uint32_t sent = routers[0].assign_tx_count;
             EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), expected[method]);
             EXPECT_EQ(routers[0].assign_tx_count, sent + (expected[method] ? 0 : 1));
-            EXPECT_EQ(pkt->length == 44, expected[method] == 1) << "where it stopped";
+            EXPECT_EQ(pkt->length == 44, expected[method] == 1) << "up to the failing component";
             EXPECT_TRUE(log.say(expected[method] ? refused[method]
                                                  : "WCCP GRP 50: TX " + names[method] +
                                                        " redirect assign: not all buckets are assigned. "
                                                        "assigned: 4 total: 7\n"));
         }
     }
-    group->bucket_count = 4; // each has its appliance
+    group->bucket_count = 4; // all slots are assigned
     for (const uint32_t method : {1u, 2u}) {
         clear();
         group->assign_method = method;
@@ -249,8 +249,8 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
     }
 }
 
-// The largest messages fit. Begun so late that a component just fits, or lacks a byte: it goes to the
-// last byte of the packet and not one byte further, and what doesn't fit leaves the packet as it was.
+// The largest messages fit. Started at an offset where a component just fits, or lacks one byte: it is
+// written up to the last byte of the packet, or the packet is unchanged.
 TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
     group->security_option = 1;
     group->fwd_method = group->ret_method = WCCP_METHOD_L2;
@@ -296,7 +296,7 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
 
 TEST_F(Load, AViewThatIsTooLargeOrMiscountedIsRefused) {
     add_routers(32);
-    add_appliances(955); // 16 + 256 + 3820 bytes, after 4
+    add_appliances(955); // 16 + 256 + 3820 bytes, at offset 4
     pkt->length = pkt->offset = 4;
     EXPECT_EQ(wccp_pkt_load_web_cache_view_info_component(group.get(), pkt.get()), 0);
     EXPECT_EQ(pkt->length, 4096u);

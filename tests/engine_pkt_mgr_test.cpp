@@ -1,5 +1,5 @@
-// The message loop: which packet gets how far and is counted where, what an I-See-You does to a group, and
-// what is sent. Time is turned by hand, and what is sent arrives at sockets of the test's own routers.
+// Message processing: how far each packet gets and which counters it moves, what an I-See-You changes in a
+// group, and what is sent. The test calls the ticks, and receives what is sent on the sockets of its routers.
 
 #include "engine/wccp_pkt_mgr.h"
 
@@ -15,7 +15,7 @@
 #include "tests/support/engine_fixture.h"
 #include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
-#include "tests/support/wire_bytes.h"
+#include "tests/support/router_messages.h"
 
 namespace {
 
@@ -27,26 +27,23 @@ be32 ipa(uint8_t third, uint8_t fourth) {
 }
 const be32 SENDER = ipa(0, 1);
 
-const wire_bytes security = hex("0000 0004 00000000");
+const wire_bytes security = security_info();
 wire_bytes service(uint32_t id = 51, uint32_t priority = 200, uint32_t protocol = 6, uint32_t flags = 0x13) {
-    return hex("0001 0018 01").u8(id).u8(priority).u8(protocol).u32(flags).zeros(16);
+    return service_info(id, priority, protocol, flags);
 }
 wire_bytes identity(uint32_t router, uint32_t receive_id = 0xa1a2a3a4) {
-    return hex("0002 0014").ip(0, router).u32(receive_id).hex("0a000064 00000001 0a000064");
+    return router_identity(host(router), host(100), receive_id);
 }
 struct element {
     uint32_t id, weight, bucket_byte;
 };
-// A view of one router, with hash elements. Each bucket byte is repeated 32 times.
+// A view of one router.
 wire_bytes view(uint32_t router, const std::vector<element> &elements, uint32_t key_change = 0,
                 uint32_t key_address = 100) {
-    wire_bytes out = hex("0004 0000 c1c2c3c4").ip(0, key_address).u32(key_change).u32(1).ip(0, router);
-    out.u32(static_cast<uint32_t>(elements.size()));
-    for (const element &each : elements) {
-        out.ip(0, each.id).u32(0).fill(32, static_cast<uint8_t>(each.bucket_byte));
-        out.u16(each.weight).u16(0);
-    }
-    return out.put16(2, static_cast<uint32_t>(out.size() - 4));
+    std::vector<hash_element> seen;
+    for (const element &each : elements)
+        seen.push_back(element_of(host(each.id), each.weight, each.bucket_byte));
+    return router_view({host(router)}, seen, host(key_address), key_change);
 }
 // The same with mask elements that redirect, in the IOS form.
 wire_bytes mask_view(uint32_t router, const std::vector<uint32_t> &ids) {
@@ -63,10 +60,7 @@ wire_bytes map(const std::vector<uint32_t> &ids) {
         out.u32(id).u32(0).u32(0).ip(0, id);
     return out.put16(2, static_cast<uint32_t>(out.size() - 4));
 }
-wire_bytes capabilities(uint32_t fwd, uint32_t assign, uint32_t ret) {
-    return hex("0008 0018 0001 0004").u32(fwd).hex("0002 0004").u32(assign).hex("0003 0004").u32(ret);
-}
-const wire_bytes by_hash = capabilities(2, 1, 2), by_mask = capabilities(2, 2, 2);
+const wire_bytes by_hash = capability_info(2, 1, 2), by_mask = capability_info(2, 2, 2);
 const wire_bytes odd_command = hex("000f 000d 0001 0004 0a000001 eeeeeeeeee"),
                  odd_unknown = hex("0063 0003 eeeeee");
 
@@ -98,7 +92,7 @@ protected:
     wccp_service_group *group = nullptr;
 };
 
-// Each packet: its result, and all counters that it moves.
+// For each packet: the result, and all counters that it moves.
 TEST_F(Messages, EachFaultIsCountedInItsPlace) {
     using counters = std::array<uint32_t, 8>;
     // all, group; I-See-Yous, failed; queries, failed; security mismatches, service mismatches
@@ -121,7 +115,7 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         int result;
         counters moved;
         std::string line;
-        std::string reason = "message-malformed 10.0.0.1: "; // what is found of all reasons
+        std::string reason = "message-malformed 10.0.0.1: "; // part of the reasons
     } rows[] = {
         {bytes(7, 0), 1, all, "WCCP: unloading msg header failed.",
          "message-malformed 10.0.0.1: a header of 7 bytes|8 bytes"},
@@ -168,7 +162,7 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
          "message-malformed 10.0.0.1: 4 optional components|3 at most"},
         {icu(1, no_view, {}), 0, icu_alone, "incompatible capabilities",
          "forwarding-not-offered 10.0.0.1: gre|L2"},
-        {icu(1, no_view, {capabilities(2, 1, 0)}), 0, bad_icu, "incompatible capabilities",
+        {icu(1, no_view, {capability_info(2, 1, 0)}), 0, bad_icu, "incompatible capabilities",
          "return-not-offered 10.0.0.1: none|gre or L2"},
         {router_0, 0, icu_alone, "", "router-id-zero: |"},
         {wire_message(13, {security, service()}), 0, bad_query, "WCCP: unloading router query failed."},
@@ -212,10 +206,10 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
     }
     group->admin_state = WCCP_ADMIN_UP;
     EXPECT_EQ(process(good), 0);
-    EXPECT_NE(router(1), nullptr) << "what was refused above stood for something that passes";
+    EXPECT_NE(router(1), nullptr) << "the message itself is valid";
 }
 
-// Two complaints for each bad packet; what is logged of them, tick by tick.
+// Each bad packet causes two complaints; how many are logged, tick by tick.
 TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
     log_lines log;
     lc_log_set_daemon_log_level(LC_LOG_WARNING);
@@ -242,21 +236,21 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
     };
     wccp_interface *const wan0 = engine.interface;
     EXPECT_EQ(lines_of(wan0, 150, 1), "200"); // the burst
-    EXPECT_EQ(lines_of(wan0, 15, 1), "20");   // a second's share
+    EXPECT_EQ(lines_of(wan0, 15, 1), "20");   // the refill of a second
     EXPECT_EQ(lines_of(&other, 5, 0), "10");
     EXPECT_EQ(lines_of(wan0, 5, 1), "11 wan0: 110"); // the flood is over
     EXPECT_EQ(lines_of(wan0, 0, 100), "0");
     EXPECT_EQ(lines_of(wan0, 101, 0), "200"); // a whole burst again
     EXPECT_EQ(process(bytes(7, 0)), 1);
-    EXPECT_TRUE(log.say("unloading msg header")) << "outside the interface's scope";
+    EXPECT_TRUE(log.say("unloading msg header")) << "outside the scope";
     lc_log_set_daemon_log_level(LC_LOG_INFO);
     {
         const wccp_complaint_scope complaints(wan0);
         EXPECT_EQ(process(icu(1, view(1, {}))), 0);
     }
-    EXPECT_TRUE(log.say("created ICU sending router")) << "which is no complaint";
+    EXPECT_TRUE(log.say("created ICU sending router")) << "which is not a complaint";
     lc_log_set_daemon_log_level(LC_LOG_WARNING);
-    // A flood that goes on is reported each minute, and the report has its part in the share.
+    // A lasting flood is reported every minute, and the report counts as a line.
     pass_seconds(1);
     for (int second = 1; second < 59; second++)
         ASSERT_EQ(lines_of(wan0, 11, 1), "20") << second;
@@ -265,8 +259,8 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
     EXPECT_EQ(wccp_g.rx_failures, 150u + 15 + 5 + 5 + 101 + 1 + 60 * 11);
 }
 
-// What fails while a good packet is processed can be repeated as often as what is wrong with a bad one.
-TEST_F(Messages, WhatAPacketCausesIsBoundedLikeWhatIsWrongWithIt) {
+// Failures while a valid packet is processed can be repeated as often as invalid packets.
+TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
     const auto report = [](uint32_t id, uint32_t weight, uint32_t also = 0) {
         wire_bytes its_view = view(id, {{100, weight, 0}});
         if (also)
@@ -281,7 +275,7 @@ TEST_F(Messages, WhatAPacketCausesIsBoundedLikeWhatIsWrongWithIt) {
     const struct {
         const char *line;
         std::function<bytes(uint32_t)> packet;
-        uint32_t more_appliances; // than there are
+        uint32_t more_appliances; // than exist
     } rows[] = {
         {"mask assignment: too many bits", [&](uint32_t i) { return report(1, i % 2 + 1); }, 0},
         {"is not in all sending router views",
@@ -289,7 +283,7 @@ TEST_F(Messages, WhatAPacketCausesIsBoundedLikeWhatIsWrongWithIt) {
         {"failed to add tunnel",
          [this](uint32_t i) {
              group->ret_method = WCCP_METHOD_GRE;
-             return icu(3 + i % 60, view(3, {}), {capabilities(2, 2, 1)});
+             return icu(3 + i % 60, view(3, {}), {capability_info(2, 2, 1)});
          },
          0},
         {"here-i-am: loading web-cache view info failed.", [](uint32_t) { return query(1, 100); }, 1000},
@@ -314,15 +308,16 @@ TEST_F(Messages, WhatAPacketCausesIsBoundedLikeWhatIsWrongWithIt) {
     }
 }
 
-TEST_F(Messages, AnISeeYouThatIsCutLeavesTheGroupAsItWas) {
+TEST_F(Messages, ATruncatedISeeYouLeavesTheGroupUnchanged) {
     process(icu(2, view(2, {{100, 100, 0xff}})));
     const wire_bytes seen = view(1, {{100, 100, 0x11}, {101, 50, 0x22}});
     const bytes whole = icu(1, seen, {by_hash, odd_command, map({100, 101})});
     const size_t mandatory = 8 + 8 + 28 + 24 + seen.size();
     size_t refused = 0;
     for (size_t length = 44; length < whole.size(); length++) {
-        const size_t behind = length - mandatory; // a message may end where an optional component does
-        if (length >= mandatory && (behind == 0 || behind == by_hash.size() || behind == by_hash.size() + 17))
+        const size_t optional = length - mandatory; // a message may end where an optional component does
+        if (length >= mandatory &&
+            (optional == 0 || optional == by_hash.size() || optional == by_hash.size() + 17))
             continue;
         bytes cut(whole.begin(), whole.begin() + static_cast<long>(length));
         cut[6] = static_cast<uint8_t>((length - 8) >> 8);
@@ -346,7 +341,7 @@ TEST_F(Messages, AnISeeYouThatIsCutLeavesTheGroupAsItWas) {
 TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
     wccp_g.seconds = 77;
     const wire_bytes seen = view(1, {{100, 100, 0x01}, {101, 50, 0xff}}, 5);
-    // Odd lengths put the capabilities, which must be found, on odd addresses.
+    // Odd lengths put the capabilities at odd addresses.
     EXPECT_EQ(process(icu(1, seen, {odd_unknown, odd_command, by_hash}), ipa(7, 7)), 0);
     EXPECT_EQ(take_reasons(group), "");
     EXPECT_EQ(group->rx_icu_failures, 0u);
@@ -365,14 +360,14 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
     EXPECT_EQ(made->src_ipa, ipa(7, 7));
     EXPECT_TRUE(made->flags & WCCP_RTR_TWO_WAY);
     EXPECT_TRUE(group->state_flags & WCCP_STATE_ACTIVE);
-    // Another service is counted, and the message taken all the same.
+    // Another service is only counted.
     wccp_g.seconds = 78;
     EXPECT_EQ(process(wire_message(11, {security, service(51, 1), identity(1, 9), view(1, {})})), 0);
     EXPECT_EQ(now(), (numbers{9, 0xc1c2c3c4, 78, 1, 0, 0, 0, WCCP_METHOD_L2, WCCP_ASSIGN_HASH, 1, 0}));
 }
 
-TEST_F(Messages, AMapFillsTheRoutersView) {
-    // 102 is in no view, and the view has 100 twice.
+TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
+    // 102 is not in the view, and the view has 100 twice.
     const std::vector<uint32_t> owners = {100, 100, 101, 102, 102, 100, 101, 101, 101, 100};
     EXPECT_EQ(process(icu(1, mask_view(1, {100, 101, 100}), {odd_unknown, map(owners), by_mask})), 0);
     EXPECT_EQ(take_reasons(group),
@@ -396,7 +391,7 @@ TEST_F(Messages, AMapFillsTheRoutersView) {
 
     EXPECT_FALSE(made->map_in_order);
 
-    // The next map replaces it. With the group's masks, the values may still be in another order.
+    // The next map replaces it. Even with the group's masks the values can be in another order.
     group->mask_src_ip = 0x41;
     group->mask_dst_ip = 0x100;
     group->mask_src_port = group->mask_dst_port = 0;
@@ -404,7 +399,7 @@ TEST_F(Messages, AMapFillsTheRoutersView) {
              {{0x00100, 0x10000, 0x10100}, false}, {{0, 0x00100, 0x10000}, true}, {{0, 0x10000}, false}}) {
         wire_bytes ordered = hex("000e 0000 00000001 00000041 00000100 00000000");
         ordered.u32(static_cast<uint32_t>(values.size()));
-        for (const uint32_t value : values) // a bit of the source, and one of the destination
+        for (const uint32_t value : values) // one bit of the source and one of the destination
             ordered.u32(value >> 16).u32(value & 0x100).u32(0).ip(0, 101);
         ordered.put16(2, static_cast<uint32_t>(ordered.size() - 4));
         EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {ordered})), 0);
@@ -413,7 +408,7 @@ TEST_F(Messages, AMapFillsTheRoutersView) {
     EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {map({101, 100})})), 0);
     EXPECT_TRUE(bits(0) == 0b10 && bits(1) == 0b01 && made->self_buckets == 1 && !made->map_in_order);
 
-    // One without a mask element is refused, alone or after a full one, once the views have been updated.
+    // A map without mask elements is refused, alone or after a full one, after the views have been updated.
     const wire_bytes empty = hex("000e 0024 00000000"), rest = hex("0063 001c").zeros(28);
     EXPECT_EQ(process(icu(1, mask_view(1, {100}), {empty, rest})), 0);
     EXPECT_EQ(group->rx_icu_failures, 1u);
@@ -422,14 +417,14 @@ TEST_F(Messages, AMapFillsTheRoutersView) {
     EXPECT_EQ(group->rx_icu_failures, 2u);
     EXPECT_TRUE(made->view_appliance_count == 2 && made->self_buckets == 1);
 
-    // What is reported by hash where mask was agreed.
+    // Hash elements when mask was agreed.
     take_reasons(group);
     process(icu(2, view(2, {{101, 50, 0xff}}), {by_mask}));
     EXPECT_EQ(take_reasons(group), "method-differs 10.0.0.2: hash by the router|mask x2; "
                                    "not-in-view 10.0.0.2: 1 appliances|10.0.0.100");
 }
 
-TEST_F(Messages, AMapOfAFullPacketIsTakenWhole) {
+TEST_F(Messages, AMapThatFillsThePacketIsProcessed) {
     const size_t room = WCCP_MAX_PACKET - icu(1, mask_view(1, {100, 101}), {by_mask}).size() - 24;
     std::vector<uint32_t> owners(room / 16 - 1, 101);
     owners.back() = 100;
@@ -442,7 +437,7 @@ TEST_F(Messages, AMapOfAFullPacketIsTakenWhole) {
     ASSERT_NE(router(1), nullptr);
     EXPECT_EQ(router(1)->self_buckets, 1);
     EXPECT_EQ(router(1)->total_buckets, owners.size());
-    message[7]++; // a longer one was cut to the buffer: dropped and not counted
+    message[7]++; // the header of a longer message, truncated to the buffer: dropped and not counted
     EXPECT_EQ(process(message), 0);
     EXPECT_TRUE(group->rx_icus == 1 && wccp_g.rx_failures == 0);
 }
@@ -464,7 +459,7 @@ TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
         uint8_t pending, timer;
         uint32_t key_address = 100;
     } steps[] = {
-        {15, 1, 1, key, false, 2, 1}, // sent before the assignment could have arrived
+        {15, 1, 1, key, false, 2, 1}, // the first assignment alone does not count
         {10, 2, 1, key - 1, false, 2, 1}, {0, 2, 1, key, false, 2, 1, 101}, // another appliance's key
         {0, 2, 1, key, true, 1, 1},       {0, 2, 1, key, true, 1, 1},       // one router acknowledges once
         {0, 2, 2, key, true, 0, 0},
@@ -478,7 +473,7 @@ TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
         const std::string reasons = take_reasons(group), wanted = "|table 10.0.0.100 number 1";
         EXPECT_EQ(reasons.find(wanted) != std::string::npos, step.assignments > 1 && !step.acked) << reasons;
     }
-    // Nothing outstanding: the timer stops as well, and nothing wraps.
+    // With no acknowledgements pending, the timer stops and the count does not wrap.
     router(1)->flags |= WCCP_RTR_ASSIGN_UNACKED;
     group->assign_timer.active = 1;
     report(1, key);
@@ -488,10 +483,10 @@ TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
 TEST_F(Messages, TheDigestDecides) {
     group->security_option = 1;
     memcpy(group->password, "secret\0", 8);
-    // md5sum of the password's eight bytes and the message with zeros in the digest's place.
+    // Computed by md5sum over the 8 bytes of the password and the message with a zero digest.
     const wire_bytes signature = hex("0000 0014 00000001 3f928e4227816919a09d11fd2b70f0f2");
     const bytes good = wire_message(
-        11, {signature, service(), identity(1), view(1, {{100, 100, 0}}, 7), capabilities(2, 3, 2)});
+        11, {signature, service(), identity(1), view(1, {{100, 100, 0}}, 7), capability_info(2, 3, 2)});
     EXPECT_EQ(process(good), 0);
     EXPECT_NE(router(1), nullptr);
     for (const size_t at : {size_t{16}, size_t{31}, size_t{40}, good.size() - 1}) {
@@ -499,7 +494,7 @@ TEST_F(Messages, TheDigestDecides) {
         changed[at] ^= 1;
         EXPECT_EQ(process(changed), 1) << at;
     }
-    EXPECT_EQ(process(icu(1, view(1, {}))), 1) << "no security where some is configured";
+    EXPECT_EQ(process(icu(1, view(1, {}))), 1) << "no security although it is configured";
     memcpy(group->password, "secreT\0", 8);
     EXPECT_EQ(process(good), 1);
     group->security_option = 0;
@@ -507,13 +502,13 @@ TEST_F(Messages, TheDigestDecides) {
     const std::string reasons = "password-mismatch 10.0.0.1: | x5; security-missing 10.0.0.1: none|MD5; "
                                 "security-unwanted 10.0.0.1: MD5|none";
     EXPECT_EQ(take_reasons(group), reasons);
-    // An I-See-You that is taken ends them, but not in their own second, and not those of others.
+    // An accepted I-See-You ends them, except those of the same second and those of other senders.
     EXPECT_EQ(process(good), 1);
     EXPECT_EQ(process(good, ipa(0, 2)), 1);
     for (uint32_t second = 0; second < 2; second++, wccp_g.seconds++)
         process(icu(1, view(1, {{100, 100, 0}})));
     EXPECT_EQ(take_reasons(group), "security-unwanted 10.0.0.2: MD5|none");
-    // Strangers push out one another, and no router of the group.
+    // Reasons of strangers replace those of strangers, not those of the group's routers.
     EXPECT_EQ(process(good), 1);
     for (uint8_t i = 0; i < 100; i++, wccp_g.seconds++)
         process(good, ipa(7, i));
@@ -527,7 +522,7 @@ TEST_F(Messages, TheDigestDecides) {
 }
 
 TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
-    // The second is written from nothing, with the state of now.
+    // Each message is built anew from the present state.
     for (const uint8_t weight : {uint8_t{100}, uint8_t{7}}) {
         group->weight = weight;
         EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, 10), 0);
@@ -536,8 +531,8 @@ TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
         EXPECT_EQ(sent[8 + 8 + 28 + 45], weight);
         EXPECT_EQ(sent, engine.sent_to("10.0.0.2"));
     }
-    // By kind and readiness: the result, and all counters so far: Here-I-Am, Redirect-Assign, failed builds,
-    // failures, no link. An attempt counts before it is built.
+    // By kind and readiness: the result, and the counters: Here-I-Am, Redirect-Assign, failed builds,
+    // failures, link drops. An attempt is counted before it is built.
     const struct {
         uint32_t kind, ready, bound;
         int result;
@@ -556,7 +551,7 @@ TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
                   row.counted);
     }
     engine.interface->ready_flags = WCCP_ALL_READY;
-    group->tx_pkt->ipa = {{255, 255, 255, 255}}; // which the kernel refuses: only a result of 0 is a failure
+    group->tx_pkt->ipa = {{255, 255, 255, 255}}; // refused by the kernel: only a result of 0 is a failure
     EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, 25), 0);
     EXPECT_EQ(group->tx_removal_replies, 1u);
     EXPECT_EQ(wccp_transmit_packet(group, nullptr, 10), 1);

@@ -1,5 +1,5 @@
-// What the engine accepts of received messages and what it refuses, over bytes written by hand. Under the
-// address sanitizer nothing after the received bytes can be touched.
+// Which received messages are accepted and which are refused, over bytes written by hand. The address
+// sanitizer catches any access after the received bytes.
 
 #include "engine/wccp_pkt_unload.h"
 
@@ -16,7 +16,7 @@ namespace {
 
 const be32 SENDER = {{10, 0, 9, 9}};
 
-// Each reader with its result thrown away, for the tests that only ask whether it refuses.
+// Each decoder without its result, for tests of what is refused.
 using reader = int (*)(wccp_service_group *, wccp_pkt *);
 template <typename Out, int (*Read)(wccp_service_group *, wccp_pkt *, Out *)>
 int read_group(wccp_service_group *group, wccp_pkt *pkt) {
@@ -49,7 +49,7 @@ const wire_bytes hash_element = hex("0a000001 0000 0000 11*32 0064 0000");
 const wire_bytes mask_element = hex("0a000002 0000 0002 22*20 0064 0000"); // that redirects, in Nexus mode
 const wire_bytes idle_element = hex("0a000003 0000 0003 22*20 0064 0000");
 const wire_bytes short_element = hex("0a000004 0000 0002 33*4 0064 0000"); // that redirects, in IOS mode
-// The counts as they are declared, then what is there.
+// The declared counts, and what is really there.
 wire_bytes view(uint32_t routers = 0, uint32_t addresses = 0, uint32_t appliances = 0,
                 const std::vector<wire_bytes> &elements = {}, uint32_t type = 4, int length_error = 0) {
     wire_bytes out = wire_bytes().u16(type).hex("0000 c1c2c3c4 0a000064 0a0b0c0d").u32(routers);
@@ -66,14 +66,14 @@ protected:
         group.id = 51;
         group.compat_mode = WCCP_COMPAT_IOS;
     }
-    // Reads the bytes from an odd place of a packet as well: a component of odd length before them is legal.
+    // At an odd offset as well, since components of odd length are legal.
     received_packet at(const wire_bytes &bytes, uint32_t shift = 0) {
         received_packet pkt = make_received(wire_bytes().fill(shift, 0xee).add(bytes).bytes, SENDER);
         pkt->offset = shift;
         pkt->cursor = pkt->data + shift;
         return pkt;
     }
-    // The bytes that a reader passed over, or -1 when it refused and left the cursor alone.
+    // The bytes that a decoder skipped, or -1 when it refused and left the cursor.
     int passed(reader read, const wire_bytes &bytes, uint32_t shift = 0) {
         const received_packet pkt = at(bytes, shift);
         const int result = read(&group, pkt.get());
@@ -85,8 +85,8 @@ protected:
     wccp_service_group group = {};
 };
 
-// Every part of a message that can be cut short is refused at every length, and taken whole at its own.
-TEST_F(Unload, NothingIsReadBehindWhatCame) {
+// Every component is refused at every length below its own.
+TEST_F(Unload, TruncatedComponentsAreRefused) {
     const struct {
         reader read;
         wire_bytes bytes;
@@ -122,14 +122,14 @@ TEST_F(Unload, NothingIsReadBehindWhatCame) {
         }
 }
 
-// Lengths and counts that lie, types out of place: each refused with its own line, or with none.
-TEST_F(Unload, RefusalsSayWhy) {
+// Wrong lengths, counts and types: each is refused with its own line or without one.
+TEST_F(Unload, RefusalsAndTheirLines) {
     const std::string bad_map =
         "unload assignment map: packet length is BAD or it has bogus values. rxed len: ";
     const struct {
         reader read;
         wire_bytes bytes;
-        std::string line; // with its group in front unless it begins with a W; empty: nothing is logged
+        std::string line; // after "WCCP GRP 51: " unless it begins with a W; empty: nothing is logged
     } rows[] = {
         {read_security, hex("0003 0004 00000000"), "WCCP: expected security componenet. rxed 3"},
         {read_security, hex("0000 0008 00000000 00*16"), ""},
@@ -212,7 +212,7 @@ TEST_F(Unload, SecurityHasItsDigestInThePacket) {
     }
 }
 
-// The compatibility mode is the form of one element, and nothing else.
+// The compatibility mode only decides the form of one element.
 TEST_F(Unload, TheFormOfAnElementFollowsFlagsAndMode) {
     const struct {
         uint16_t flags;
@@ -238,7 +238,7 @@ TEST_F(Unload, TheFormOfAnElementFollowsFlagsAndMode) {
     EXPECT_EQ(passed(read_view, nexus), 56);
 }
 
-// Elements of a Router View decoded.
+// --- Elements of a Router View
 
 const be32 OURS = {{10, 0, 0, 1}};
 
@@ -259,7 +259,7 @@ struct decoded_elements {
 decoded_elements decode(wccp_service_group *group, const std::vector<wire_bytes> &elements, size_t cut = 0) {
     group->appliance_ipa = OURS;
     decoded_elements out;
-    wire_bytes all; // at an odd address, and not a byte longer than what is read
+    wire_bytes all; // at an odd address, without a byte to spare
     all.u8(0);
     for (const wire_bytes &each : elements)
         all.add(each);
@@ -297,11 +297,10 @@ TEST_F(Unload, ElementsAreDecodedByTheirForm) {
 
     EXPECT_EQ(decode(&group, {}).result, 0);
     EXPECT_EQ(decode(&group, {}).hash.total_count, 0);
-    // Another hash revision is refused, historical or not, and so are elements that end too early and a call
-    // without a place for the result.
+    // Another hash revision is refused, historical or not, and so are truncated elements and null arguments.
     EXPECT_EQ(decode(&group, {hash_form(1, 100, full), hash_form(2, 1, full, 0x80, 1)}).result, 1);
     for (const wire_bytes &last : elements)
-        for (size_t cut = 3; cut <= last.size(); cut++) // the status in the last two bytes isn't read
+        for (size_t cut = 3; cut <= last.size(); cut++) // the last two bytes, the status, are not read
             EXPECT_EQ(decode(&group, {elements[3], last}, cut).result, 1) << last.size() << " - " << cut;
     decoded_elements none;
     EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(nullptr, 0, {}, none.list, &none.hash), 1);
@@ -338,7 +337,7 @@ TEST_F(Unload, BucketBitsAreCountedWhateverTheirPattern) {
 }
 
 TEST_F(Unload, AMapKeepsItsFirstMaskAndItsLastValues) {
-    // Four bytes more than the elements need: they stay unread.
+    // Four bytes more than the elements need are not read.
     const wire_bytes two = hex("000e 0058 00000002 "
                                "00001741 00*8 00000001 00000001 00*8 0a000064 "
                                "00009999 00*8 00000002 00000002 00*8 0a000065 00000003 00*8 0a000066 00*4");
@@ -368,7 +367,7 @@ TEST_F(Unload, CapabilitiesTakeTheLastOfEachKind) {
     ASSERT_EQ(wccp_pkt_unload_capability_info_component(&group, pkt.get(), &out), 0);
     EXPECT_TRUE(out.forwarding == 0x103 && out.assignment == 3 && out.ret == 2);
     EXPECT_EQ(group.rx_unknown_capabilities, 1u);
-    EXPECT_NE(log.take(), "") << "more than the three known ones are worth a line";
+    EXPECT_NE(log.take(), "") << "more than the three known capabilities are logged";
     pkt = at(hex("0008 0018 0001 0004 00000002 0002 0004 00000002 0003 0004 00000002"));
     ASSERT_EQ(wccp_pkt_unload_capability_info_component(&group, pkt.get(), &out), 0);
     EXPECT_EQ(log.take(), "");

@@ -17,8 +17,7 @@ using numbers = std::vector<uint32_t>;
 
 struct RouterTest : testing::Test, all_freed, reported_group {
     RouterTest() : reported_group(false) { wccp_g.seconds = 0; }
-    // The agreed codes as one number, forwarding first; minus one minus the result where there is no
-    // agreement.
+    // The agreed codes as one number, forwarding first; -1 minus the result when there is no agreement.
     int decide(uint32_t forwarding, uint32_t assignment, uint32_t ret) {
         const wccp_rtr_capabilities offered = {forwarding, assignment, ret};
         wccp_rtr_capabilities agreed = {7, 7, 7};
@@ -41,7 +40,7 @@ TEST_F(RouterTest, EachMethodIsAgreedByItsOwnRule) {
     const int forwarding[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 2}, {0, 0, 0, 0}};
     const int assign_with_gre[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 1}, {0, 0, 0, 0}};
     const int assign_with_l2[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 2}, {0, 0, 0, 0}};
-    const int returning[4] = {0, 1, 2, 1}; // the configuration has no say
+    const int returning[4] = {0, 1, 2, 1}; // not configurable
     for (uint32_t local = 0; local < 25; local++) {
         const uint32_t local_fwd = local / 5, local_assign = local % 5;
         configure(local_fwd, local_assign);
@@ -57,9 +56,9 @@ TEST_F(RouterTest, EachMethodIsAgreedByItsOwnRule) {
     }
 }
 
-TEST_F(RouterTest, RefusalsAndRoutersAreToldInTheLog) {
+TEST_F(RouterTest, RefusalsAndRoutersAreLogged) {
     log_lines log;
-    const auto tells = [&log](const std::vector<std::string> &wanted) { // in this order
+    const auto logs = [&log](const std::vector<std::string> &wanted) { // in this order
         const std::string lines = log.take();
         size_t from = 0;
         for (const std::string &line : wanted) {
@@ -70,26 +69,26 @@ TEST_F(RouterTest, RefusalsAndRoutersAreToldInTheLog) {
     const std::string refused = "incompatible capabilities (router id 10.0.0.201) : local";
     configure(WCCP_METHOD_L2, WCCP_ASSIGN_MASK);
     decide(0xfd, 3, 2);
-    tells({refused + ": (fwd encap: L2 ) router sent: (fwd: gre return: L2)"});
+    logs({refused + ": (fwd encap: L2 ) router sent: (fwd: gre return: L2)"});
     decide(3, 1, 3);
-    tells({refused + " assign method: mask  router assign method: hash"});
+    logs({refused + " assign method: mask  router assign method: hash"});
     decide(3, 3, 0);
-    tells({refused + " return method: gre or L2  router return method: none"});
+    logs({refused + " return method: gre or L2  router return method: none"});
     EXPECT_EQ(take_reasons(group), "forwarding-not-offered 10.0.0.201: gre|L2; assignment-not-offered "
                                    "10.0.0.201: hash|mask; return-not-offered 10.0.0.201: none|gre or L2");
     const wccp_rtr_capabilities agreed = {2, 1, 2};
     wccp_create_sending_router(group, ROUTER_A, &agreed, &agreed);
-    tells({"agreed capabilities: fwd: 2 assign: 1 return: 2 deciding rtr id 10.0.0.201",
-           "alarm: schedule router connectivity verify timer in 60 seconds",
-           "created ICU sending router 10.0.0.201 "});
+    logs({"agreed capabilities: fwd: 2 assign: 1 return: 2 deciding rtr id 10.0.0.201",
+          "alarm: schedule router connectivity verify timer in 60 seconds",
+          "created ICU sending router 10.0.0.201 "});
     wccp_create_sending_router(group, {}, &agreed, &agreed);
-    tells({"invalid router id in ICU. 0.0.0.0"});
+    logs({"invalid router id in ICU. 0.0.0.0"});
     uint32_t buckets;
     wccp_get_router_assignment(group, router(ROUTER_A), host(3), &buckets);
-    tells({"get router assign. failed. cannot find appliance 10.0.0.3 in router's view: 10.0.0.201"});
+    logs({"get router assign. failed. cannot find appliance 10.0.0.3 in router's view: 10.0.0.201"});
     wccp_g.seconds += 40;
     wccp_monitor_sending_routers(group);
-    tells({"removing router (router id: 10.0.0.201) due to inactivity."});
+    logs({"removing router (router id: 10.0.0.201) due to inactivity."});
     EXPECT_EQ(take_reasons(group), "router-id-zero: |; router-silent 10.0.0.201: |an I-See-You within 40 s");
 }
 
@@ -112,7 +111,7 @@ TEST_F(RouterTest, WhatTheFirstRouterAgreedHoldsForAll) {
 }
 
 TEST_F(RouterTest, ANewRouterIsOneWayAndKeepsItsOffer) {
-    // None for router 0, and none without a tunnel: there is no tunneld to ask.
+    // Router id 0, and GRE without a tunneld, are refused.
     const wccp_rtr_capabilities l2 = {2, 2, 2}, gre = {1, 1, 2}, gre_return = {2, 1, 1};
     EXPECT_EQ(wccp_create_sending_router(group, {}, &l2, &l2), nullptr);
     for (const wccp_rtr_capabilities *agreed : {&gre, &gre_return})
@@ -136,7 +135,7 @@ TEST_F(RouterTest, ANewRouterIsOneWayAndKeepsItsOffer) {
     EXPECT_EQ(group->sending_router_count, 32u);
 }
 
-TEST_F(RouterTest, SilenceCountsAcrossTheWrapOfTheClock) {
+TEST_F(RouterTest, TheHoldTimeWorksAcrossTheWrapOfTheClock) {
     wccp_g.seconds = 0xfffffff0;
     router(ROUTER_A);
     wccp_g.seconds += 39;
@@ -147,7 +146,7 @@ TEST_F(RouterTest, SilenceCountsAcrossTheWrapOfTheClock) {
     EXPECT_EQ(group->sending_router_count, 0u);
 }
 
-TEST_F(RouterTest, ARemovalTakesItsMentionsItsShareAndLastTheAgreement) {
+TEST_F(RouterTest, ARemovalDropsReferencesRedirectionAndLastTheAgreement) {
     for (const be32 id : {ROUTER_A, ROUTER_B, ROUTER_C})
         see(id, {id, ROUTER_A}, {{US, 100}, {id, 100}});
     router(ROUTER_A)->self_buckets = 10;
@@ -165,7 +164,8 @@ TEST_F(RouterTest, ARemovalTakesItsMentionsItsShareAndLastTheAgreement) {
     const uint32_t changed = WCCP_DESG_ELECT_PENDING, agreed = WCCP_CAPABILITIES_SET;
     router(ROUTER_B)->last_icu_time = 20;
     router(ROUTER_C)->last_icu_time = 40;
-    // A is still named by the others; then the last one goes that redirected here; then the last.
+    // A is still listed by the others; then the last router that redirects here is removed; then the last
+    // router.
     EXPECT_EQ(after(40), (numbers{2, 3, 3, 1, 1, WCCP_STATE_ACTIVE | agreed | changed, 1}));
     EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ADJACENCY);
     EXPECT_EQ(after(60), (numbers{1, 2, 2, 2, 0, WCCP_STATE_INIT | agreed | changed, 2}));
@@ -173,7 +173,7 @@ TEST_F(RouterTest, ARemovalTakesItsMentionsItsShareAndLastTheAgreement) {
     EXPECT_TRUE(!group->router_view && !group->appliance_view);
 }
 
-TEST_F(RouterTest, QueriesAreAnsweredToTwoWayRoutersAndAFloodIsBounded) {
+TEST_F(RouterTest, RemovalQueriesOfTwoWayRoutersAreAnsweredUpToALimit) {
     router(ROUTER_A);
     EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_B, host(77)), 0); // not known
     EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_A, host(77)), 0); // one-way
@@ -188,7 +188,7 @@ TEST_F(RouterTest, QueriesAreAnsweredToTwoWayRoutersAndAFloodIsBounded) {
     EXPECT_EQ(pkt->ipa, ROUTER_A);
     EXPECT_NE(memmem(pkt->data, pkt->length, host(77).bytes, 4), nullptr) << "the query's receive id";
     const std::vector<uint8_t> written(pkt->data, pkt->data + pkt->length);
-    see(ROUTER_A, {ROUTER_A, ROUTER_B}, {{US, 100}}); // and is not written again
+    see(ROUTER_A, {ROUTER_A, ROUTER_B}, {{US, 100}}); // the reply is not built again
     log_lines log;
     int answered = 1;
     for (int query = 1; query < 100; query++)
@@ -197,7 +197,7 @@ TEST_F(RouterTest, QueriesAreAnsweredToTwoWayRoutersAndAFloodIsBounded) {
     EXPECT_EQ(take_reasons(group), "query-refused 10.0.0.202: a query before an I-See-You|; query-refused "
                                    "10.0.0.201: one more query|8 replies waiting at most x93");
     EXPECT_TRUE(log.say("maximum of waiting replies (8) reached. (router id 10.0.0.201)"));
-    see(ROUTER_B, {ROUTER_A}, {{US, 100}}); // and doesn't lose its answer by that
+    see(ROUTER_B, {ROUTER_A}, {{US, 100}}); // the flood does not affect another router
     EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_B, host(79)), 0);
     pass_seconds(2);
     EXPECT_EQ(group->removal_reply_count, 9u);
@@ -208,7 +208,7 @@ TEST_F(RouterTest, QueriesAreAnsweredToTwoWayRoutersAndAFloodIsBounded) {
     EXPECT_EQ(group->tx_removal_replies, 3u * 9);
 }
 
-TEST_F(RouterTest, QuestionsAboutRouters) {
+TEST_F(RouterTest, QueriesAboutRouters) {
     uint32_t one_way = 9, two_way = 9, buckets = 9;
     EXPECT_EQ(wccp_get_router_connection_stats(nullptr, &one_way, &two_way), 1);
     EXPECT_EQ(wccp_get_router_connection_stats(group, &one_way, &two_way), 0);

@@ -1,5 +1,5 @@
-// The seconds at which things happen: Here-I-Am, election, Redirect-Assign, time-outs and alarm checks, with
-// the engine's ticks turned by hand; and the state with its role.
+// When things happen: Here-I-Am, election, Redirect-Assign, time-outs and alarm checks, with ticks called by
+// the test; and the state with its role.
 #include "engine/wccp_state.h"
 
 #include <map>
@@ -87,7 +87,7 @@ TEST_F(StateTest, TheLowestAddressAsANumberIsDesignated) {
         {to_be32(0x0a000002), to_be32(0x0a000101), true}, // the last octet doesn't lead here
         {to_be32(0x0a000101), to_be32(0x0a000002), false},
         {to_be32(0x0a000001), to_be32(0xc0a80001), true},
-        {host(9), host(9), true}, // itself only
+        {host(9), host(9), true}, // only itself
     };
     for (const auto &c : cases) {
         group->appliance_ipa = c.own;
@@ -105,8 +105,8 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
         be32 from;
         std::vector<be32> routers;
         std::vector<uint32_t> appliances; // 10.0.0.x, of weight 100
-        const char *elected;              // key, acknowledgements due, slots of each active appliance
-        const char *reasons = nullptr;    // null: not looked at
+        const char *elected;              // key, pending acknowledgements, slots of each active appliance
+        const char *reasons = nullptr;    // null: not compared
     } steps[] = {
         {A, {A, B}, {1}, "no", "election-blocked 10.0.0.202: no I-See-You|two-way"},
         {B, {A, B}, {}, "no", "election-blocked 10.0.0.202: one-way|two-way"},
@@ -115,11 +115,11 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
         {B,
          {A, B},
          {1, 3},
-         "1 0", // nobody is reported by all of them
+         "1 0", // no appliance is reported by all
          "appliance-left-out 10.0.0.3: in 1 views|in those of all 3 routers; appliance-left-out 10.0.0.1: in "
          "2 views|in those of all 3 routers"},
-        {C, {}, {0, 1}, "no"},     // a lower one
-        {C, {}, {1}, "1 3 1:256"}, // the key counts from the start
+        {C, {}, {0, 1}, "no"},     // a lower address
+        {C, {}, {1}, "1 3 1:256"}, // the key starts again
         {A, {A, B}, {1, 3}, "2 3 1:256"},
         {B, {A, B}, {3, 1, 4}, "3 3 1:256"},
         {A, {A, B}, {4, 3, 1}, "4 3 1:256"},
@@ -136,7 +136,7 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
         const bool election = (group->state_flags & WCCP_DESG_ELECT_PENDING) != 0;
         router(A)->assign_tx_count = 2;
         pass_seconds(1);
-        EXPECT_FALSE(group->state_flags & WCCP_DESG_ELECT_PENDING); // no timer tries again
+        EXPECT_FALSE(group->state_flags & WCCP_DESG_ELECT_PENDING); // it is not repeated
         EXPECT_EQ(router(A)->assign_tx_count, election ? 0u : 2u);
         EXPECT_EQ((router(A)->flags & WCCP_RTR_ASSIGN_UNACKED) != 0, group->pending_acks != 0);
         EXPECT_EQ(group->assign_timer.active, group->pending_acks != 0);
@@ -155,7 +155,7 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
     EXPECT_EQ(group->assign_timer.active, 0);
 }
 
-// Each computation warns of the appliances that not all routers list, but a log can take only so much.
+// Each computation could warn of every appliance that is not listed by all routers.
 TEST_F(StateTest, AnApplianceThatIsLeftOutIsLoggedOnce) {
     log_lines log;
     lc_log_set_daemon_log_level(LC_LOG_WARNING);
@@ -167,13 +167,13 @@ TEST_F(StateTest, AnApplianceThatIsLeftOutIsLoggedOnce) {
         std::string logged;
     } steps[] = {
         {A, {{US, 1}, {host(3), 1}}, 0, ""},
-        {B, {{US, 1}, {host(4), 1}}, 1, "4 3 "}, // elected
+        {B, {{US, 1}, {host(4), 1}}, 1, "4 3 "}, // the election
         {A, {{US, 2}, {host(3), 2}}, 0, ""},     // two computations
-        {A, {{US, 3}, {host(3), 3}}, 1, ""},     // and in another second
-        // One with 5, for the first time in this second, and one with 6.
+        {A, {{US, 3}, {host(3), 3}}, 1, ""},     // in another second
+        // 5 and 6 are new.
         {A, {{host(5), 1}, {US, 4}, {host(6), 1}, {host(3), 4}}, 0, "3 5 4 6 "},
         {B, {{US, 5}, {host(3), 5}, {host(4), 5}}, 0, ""},     // 3 is listed by all from now on
-        {A, {{US, 6}, {host(3), 6}, {host(6), 1}}, 1, "4 6 "}, // 5 is gone, too
+        {A, {{US, 6}, {host(3), 6}, {host(6), 1}}, 1, "4 6 "}, // without 5
         {B, {{US, 7}, {host(4), 5}}, 1, "3 4 6 "},
         {A, {{US, 8}, {host(3), 6}, {host(6), 1}}, 59, ""},
         {A, {{US, 9}, {host(3), 6}, {host(6), 1}}, 1, ""},
@@ -195,15 +195,15 @@ TEST_F(StateTest, AnApplianceThatIsLeftOutIsLoggedOnce) {
     EXPECT_EQ(group->designated, 1u);
 }
 
-TEST_F(StateTest, ASilentRouterGoesAfter40To44Seconds) {
-    for (uint32_t phase = 0; phase < 5; phase++) { // sweeps go by the start of the group
+TEST_F(StateTest, ARouterTimesOutAfter40To44Seconds) {
+    for (uint32_t phase = 0; phase < 5; phase++) { // the sweep depends on the start of the group
         see(ROUTER_A, {ROUTER_A}, {{US, 100}});
         const uint32_t expected = phase == 0 ? 40 : 45 - phase;
         pass_seconds(expected - 1);
         EXPECT_EQ(group->sending_router_count, 1u);
         pass_seconds(1);
         EXPECT_EQ(group->sending_router_count, 0u);
-        EXPECT_TRUE(group->state_flags & WCCP_DESG_ELECT_PENDING); // the election is the next tick's
+        EXPECT_TRUE(group->state_flags & WCCP_DESG_ELECT_PENDING); // in the next tick
         EXPECT_EQ(group->designated, 1u);
         EXPECT_EQ(group->raised_alarms, WCCP_ALARM_ADJACENCY);
         pass_seconds(1 + phase);
@@ -213,12 +213,12 @@ TEST_F(StateTest, ASilentRouterGoesAfter40To44Seconds) {
     EXPECT_EQ(group->routers_timed_out, 5u);
 }
 
-TEST_F(StateTest, StatesTellTheirRolesEachTime) {
+TEST_F(StateTest, EveryEntryIntoAStatePublishesItsRole) {
     const struct {
         int (*enter)(wccp_service_group *);
         uint32_t state, transitions, state_time;
     } steps[] = {
-        {wccp_appliance_state_init, WCCP_STATE_INIT, 0, 0}, // it is in INIT
+        {wccp_appliance_state_init, WCCP_STATE_INIT, 0, 0}, // already in INIT
         {wccp_appliance_state_active, WCCP_STATE_ACTIVE, 1, 1010},
         {wccp_appliance_state_active, WCCP_STATE_ACTIVE, 2, 1020},
         {wccp_appliance_state_backup, WCCP_STATE_BACKUP, 3, 1030},
@@ -246,16 +246,16 @@ TEST_F(StateTest, StatesTellTheirRolesEachTime) {
               (std::vector{active, active, backup, backup, backup, std::string("1 255 2 237")}));
 }
 
-// Alarms.
+// --- Alarms
 
-TEST_F(StateTest, ASilentRouterRaisesTheAdjacencyAlarm60SecondsAfterTheStart) {
+TEST_F(StateTest, AMissingRouterRaisesTheAdjacencyAlarm60SecondsAfterTheStart) {
     group->ucast_router_count = 2;
     see(ROUTER_A, {ROUTER_A}, {{US, 100}});
     stay_alive(59);
     EXPECT_FALSE(raised(WCCP_ALARM_ADJACENCY));
     stay_alive(1);
     EXPECT_TRUE(raised(WCCP_ALARM_ADJACENCY));
-    stay_alive(100); // a quiet group keeps what it has
+    stay_alive(100); // without events the alarm stays
     EXPECT_TRUE(raised(WCCP_ALARM_ADJACENCY));
     uint32_t cleared_after = 0;
     while (raised(WCCP_ALARM_ADJACENCY) && cleared_after < 100) {
@@ -277,12 +277,12 @@ TEST_F(StateTest, ALaterReasonLeavesTheCheckWhereItIs) {
     EXPECT_EQ(group->router_alarm_timer.active, 1);
     pass_seconds(1);
     EXPECT_EQ(group->router_alarm_timer.active, 0);
-    wccp_alarm_schedule_verify_router_connectivity_timer(group, 0); // a stopped one starts anew
+    wccp_alarm_schedule_verify_router_connectivity_timer(group, 0); // a stopped timer starts again
     EXPECT_EQ(group->router_alarm_timer.countdown, 60u);
     group->assign_alarm_timer = {.active = 1, .mode = 2, .remaining = 1, .period = 60, .countdown = 0};
     wccp_alarm_schedule_verify_allocation_table_timer(group, 0);
     EXPECT_EQ(group->assign_alarm_timer.countdown, 60u);
-    // Clearing stops the timers, and passes over a group without alarms.
+    // Clearing stops the timers, but only of a group with alarms.
     wccp_alarms_clear_all();
     EXPECT_EQ(group->router_alarm_timer.active, 1);
     wccp_alarm_raise_router_down_alarm(group);
@@ -293,21 +293,21 @@ TEST_F(StateTest, ALaterReasonLeavesTheCheckWhereItIs) {
     EXPECT_EQ(group->router_alarm_timer.active + group->assign_alarm_timer.active, 0);
 }
 
-// The two checks: what the log says after "alarm: ", and whether an event went, which fails without a
+// The checks: the log lines after "alarm: ", and "event" when a message was sent, which fails without a
 // session.
 struct CheckTest : StateTest {
     std::string said(int (*check)(wccp_service_group *)) {
         log.take();
         EXPECT_EQ(check(group), 0);
         std::istringstream lines(log.take());
-        std::string told;
+        std::string found;
         for (std::string line; std::getline(lines, line);) {
             const size_t at = line.find("WCCP GRP 51: alarm: ");
-            told += at != std::string::npos                       ? line.substr(at + 20) + "\n"
-                    : line.ends_with("Error code 14001 returned") ? "event\n"
-                                                                  : "";
+            found += at != std::string::npos                       ? line.substr(at + 20) + "\n"
+                     : line.ends_with("Error code 14001 returned") ? "event\n"
+                                                                   : "";
         }
-        return told;
+        return found;
     }
     std::string connectivity() { return said(wccp_alarm_verify_router_connectivity); }
     std::string allocation() { return said(wccp_alarms_verify_allocation_table); }
@@ -325,8 +325,8 @@ TEST_F(CheckTest, ConnectivityIsHealthyWithEnoughTwoWayAndNoneOneWay) {
                                   "two-way: 0\n" +
                                   raise);
     see(ROUTER_A, {}, {{US, 1}});
-    EXPECT_EQ(connectivity(), begin); // it is active already
-    group->mcast_configured = 1;      // then one is enough
+    EXPECT_EQ(connectivity(), begin); // already active
+    group->mcast_configured = 1;      // one router is then enough
     EXPECT_EQ(connectivity(),
               begin + "clearing router down alarm: routers one-way: 0 two-way: 1 configured: 1.\n" + clear);
     see(ROUTER_B, {}, {{US, 1}});
@@ -338,7 +338,7 @@ TEST_F(CheckTest, ConnectivityIsHealthyWithEnoughTwoWayAndNoneOneWay) {
                                   raise);
 }
 
-TEST_F(CheckTest, TheAssignmentIsComparedOrSearchedForHoles) {
+TEST_F(CheckTest, TheAssignmentIsComparedOrSearchedForGaps) {
     const std::string begin = "verify assignment table.\n", other = begin + "verify by non-designator.\n",
                       raise = "raising assignment table mismatch alarm\nevent\n",
                       clear = "clearing assignment table alarm\nevent\n",
@@ -348,7 +348,7 @@ TEST_F(CheckTest, TheAssignmentIsComparedOrSearchedForHoles) {
     see(ROUTER_A, {}, {});
     EXPECT_EQ(allocation(), other + nobody + raise);
     see(ROUTER_A, {}, {{US, 0}});
-    EXPECT_EQ(allocation(), other + nobody); // in order, but for nobody
+    EXPECT_EQ(allocation(), other + nobody); // in order, but redirects to none
     see(ROUTER_A, {}, {{US, 0}, {host(2), 7}});
     EXPECT_EQ(allocation(),
               other + "router 10.0.0.201 is not redirecting to appliance (10.0.0.2 weight 7)\n");
@@ -380,7 +380,7 @@ TEST_F(CheckTest, TheAssignmentIsComparedOrSearchedForHoles) {
     EXPECT_EQ(allocation(), first + mismatch("1", "201", 127) + raise);
     wccp_g.seconds++;
     router(ROUTER_A)->view_appliances[0].buckets_assigned = 128;
-    router(ROUTER_A)->view_appliances[2].weight = 1; // and no buckets
+    router(ROUTER_A)->view_appliances[2].weight = 1; // without buckets
     EXPECT_EQ(allocation(),
               first + "verify " + compared("1", "201", 128) +
                   "allocation mismatch. appliance 10.0.0.3 weight : 1 router 10.0.0.201 buckets : 0\n");

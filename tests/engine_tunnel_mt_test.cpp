@@ -1,4 +1,4 @@
-// The tunnel table against a tunneld that answers, refuses, says nothing, or is left waiting.
+// The tunnel table with a tunneld that answers, refuses, or does not answer.
 
 #include "engine/wccp_tunnel.h"
 
@@ -8,6 +8,7 @@
 #include <string>
 
 #include "engine/wccp_host.h"
+#include "engine/wccp_router_utils.h"
 #include "engine/wccpd_common.h"
 #include "tests/support/fake_tunneld.h"
 #include "tests/support/log_lines.h"
@@ -36,8 +37,8 @@ struct Tunnels : testing::Test {
         wccpd_exiting = 0;
         tunneld.answer_with(tunneld_does);
         EXPECT_EQ(wccp_del_all_tunnels(), 0);
-        EXPECT_EQ(wccp_g.stat_allocs - wccp_g.stat_frees, allocated) << "every record is free again";
-        // All 32 ids are there again, whatever the test did.
+        EXPECT_EQ(wccp_g.stat_allocs - wccp_g.stat_frees, allocated) << "every record is freed";
+        // All 32 ids are free again.
         tunneld.take_commands();
         std::set<uint16_t> ids;
         for (uint32_t i = 0; i < 32; i++)
@@ -52,7 +53,7 @@ struct Tunnels : testing::Test {
     fake_tunneld tunneld;
     uint32_t allocated;
     log_lines log;
-    wccp_service_group group = {}; // for the reasons alone
+    wccp_service_group group = {}; // only for its reasons
 };
 
 std::optional<tunneld_answer> tunneld_refuses(const seen_command &command) {
@@ -79,14 +80,14 @@ TEST_F(Tunnels, GroupsThatShareARouterShareTheTunnel) {
 
     wccp_add_tunnel(51, self, router(1));
     wccp_add_tunnel(52, self, router(1));
-    EXPECT_EQ(wccp_del_tunnel(0, self, router(1), 1), 0) << "by force, whatever the references";
+    EXPECT_EQ(wccp_del_tunnel(0, self, router(1), 1), 0) << "by force, in spite of the other reference";
     EXPECT_TRUE(log.say("WCCP : deleted GRE tunnel id: 1000"));
     EXPECT_EQ(commands().size(), 2u);
     EXPECT_EQ(wccp_del_tunnel(52, self, router(1), 0), 0);
     EXPECT_EQ(commands().size(), 0u);
 }
 
-TEST_F(Tunnels, ThirtyTwoIdsAndTheFreedOneIsNext) {
+TEST_F(Tunnels, ThereAreThirtyTwoIdsAndAFreedOneIsUsedNext) {
     for (uint32_t i = 0; i < 32; i++) {
         ASSERT_EQ(wccp_add_tunnel(1, self, router(i)), 0);
         log.take();
@@ -95,7 +96,7 @@ TEST_F(Tunnels, ThirtyTwoIdsAndTheFreedOneIsNext) {
     EXPECT_EQ(wccp_add_tunnel(1, self, router(32)), 1);
     EXPECT_TRUE(log.say("WCCP GRP 1: No free tunnel id available"));
     EXPECT_EQ(take_reasons(&group), "tunnel-ids-exhausted 10.0.1.32: |ids 1000 to 1031");
-    EXPECT_EQ(wccp_add_tunnel(1, self, router(4)), 0) << "an old one needs no id";
+    EXPECT_EQ(wccp_add_tunnel(1, self, router(4)), 0) << "a known one needs no id";
     EXPECT_EQ(commands().size(), 0u);
     for (const uint32_t i : {31u, 7u}) {
         EXPECT_EQ(wccp_del_tunnel(1, self, router(i), 0), 0);
@@ -114,28 +115,28 @@ TEST_F(Tunnels, ARefusedAddLeavesNothing) {
         EXPECT_EQ(take_reasons(&group), "tunnel-refused 10.0.1.1: tunnel id 1000|from 10.0.0.1");
         EXPECT_EQ(commands().size(), 1u);
         EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
-        EXPECT_EQ(commands().size(), 0u) << "it isn't in the table";
+        EXPECT_EQ(commands().size(), 0u) << "it is not in the table";
     }
     tunneld.answer_with(tunneld_does);
     EXPECT_EQ(wccp_add_tunnel(51, self, router(2)), 0);
     EXPECT_EQ(commands()[0].tunnel_id, g_qv_encap_wccp_first);
 }
 
-TEST_F(Tunnels, ARefusedDeleteTakesTheTunnelOutAllTheSame) {
+TEST_F(Tunnels, ARefusedDeleteRemovesTheTunnelNevertheless) {
     wccp_add_tunnel(51, self, router(1));
     wccp_add_tunnel(51, self, router(2));
     tunneld.answer_with(tunneld_refuses);
     EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 1);
     EXPECT_TRUE(log.say("WCCP GRP 51: failed to delete GRE tunnel id: 1000"));
     wccpd_exiting = 1;
-    EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "in silence during the exit";
+    EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "not logged during the exit";
     EXPECT_FALSE(log.say("failed to delete"));
     commands();
     wccp_del_all_tunnels();
     EXPECT_EQ(commands().size(), 0u);
 }
 
-TEST_F(Tunnels, RestoreGivesEveryTunnelAgainAndKeepsThemAll) {
+TEST_F(Tunnels, RestoreSendsEveryTunnelAgainAndKeepsThemAll) {
     for (uint32_t i = 0; i < 3; i++)
         wccp_add_tunnel(1, self, router(i));
     commands();
@@ -154,8 +155,35 @@ TEST_F(Tunnels, RestoreGivesEveryTunnelAgainAndKeepsThemAll) {
     EXPECT_EQ(given[2].index, 70u + g_qv_encap_wccp_first) << "the new index";
 }
 
-// Tunnels come and go on several threads while all are deleted, as at exit: commands don't overlap, and each
-// gets the answer to its own.
+// The sending routers of a group hold the references.
+TEST_F(Tunnels, RoutersGetATunnelEachAndGiveItBack) {
+    const reported_group shared(false, 60);
+    wccp_service_group *known = shared.group;
+    const auto codes = [this] {
+        std::vector<uint16_t> found;
+        for (const seen_command &command : commands())
+            found.push_back(command.code);
+        return found;
+    };
+    const wccp_rtr_capabilities gre = {1, 1, 1}, gre_return = {2, 1, 1};
+    ASSERT_NE(wccp_create_sending_router(known, ROUTER_A, &gre, &gre), nullptr);
+    wccp_sending_router *b = wccp_create_sending_router(known, ROUTER_B, &gre_return, &gre_return);
+    ASSERT_NE(b, nullptr);
+    EXPECT_EQ(b->flags, WCCP_RTR_ONE_WAY | WCCP_RTR_HAS_TUNNEL);
+    EXPECT_EQ(codes(), (std::vector<uint16_t>{MAILBOX_ADD_TUNNEL, MAILBOX_ADD_TUNNEL}));
+    tunneld.answer_with([](const seen_command &) { return tunneld_answer{1, 5}; });
+    EXPECT_EQ(wccp_create_sending_router(known, ROUTER_C, &gre, &gre), nullptr);
+    EXPECT_EQ(known->sending_router_count, 2u);
+    tunneld.answer_with(tunneld_does);
+    codes();
+    wccp_g.seconds += 40;
+    wccp_monitor_sending_routers(known);
+    EXPECT_EQ(known->sending_router_count, 0u);
+    EXPECT_EQ(codes(), (std::vector<uint16_t>{MAILBOX_DELETE_TUNNEL, MAILBOX_DELETE_TUNNEL}));
+}
+
+// Several threads add and delete tunnels while all are deleted, as at exit: commands do not overlap, and each
+// thread gets the answer to its own command.
 TEST_F(Tunnels, DeletingAllWhileOthersAddAndDelete) {
     std::atomic<bool> stop = false;
     std::atomic<int> torn = 0;

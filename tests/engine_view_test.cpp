@@ -20,8 +20,8 @@ namespace {
 
 struct ViewTest : testing::Test, all_freed, reported_group {
     ViewTest() : reported_group(false) {}
-    // The union, in list order: routers with their references, appliances with weight and references; then by
-    // how much the change number has risen since the last call.
+    // The union in list order: routers with their references, appliances with weight and references; then the
+    // rise of the change number since the last call.
     std::string views() {
         std::ostringstream text;
         const auto name = [](be32 ipa) { return std::string(addr_text(ipa).s).substr(5); };
@@ -44,7 +44,7 @@ struct ViewTest : testing::Test, all_freed, reported_group {
     uint32_t seen_change_number = 0;
 };
 
-TEST_F(ViewTest, ReportsMoveTheUnion) {
+TEST_F(ViewTest, ReportsUpdateTheUnion) {
     const be32 A = ROUTER_A, B = ROUTER_B;
     const be32 low = to_be32(0x0a000002), high = to_be32(0x0a000101);
     const struct {
@@ -63,25 +63,24 @@ TEST_F(ViewTest, ReportsMoveTheUnion) {
          {},
          {{host(10), 50}, {host(11), 60}, {host(12), 55}, {host(13), 70}},
          "| 0.13/70:1 0.11/60:1 0.12/55:1 0.10/50:1 +1"},
-        // Of equal weights the higher address, as a number, goes first.
+        // Of equal weights the higher address, as a number, comes first.
         {A, {}, {{low, 9}, {high, 9}}, "| 1.1/9:1 0.2/9:1 +1"},
         {A, {}, {}, "| +1"},
         {A, {}, {{high, 9}, {low, 9}}, "| 1.1/9:1 0.2/9:1 +1"},
-        // References are counted, and an entry goes with the last.
+        // References are counted, and an entry is freed with the last one.
         {A, {A, B}, {{US, 100}, {low, 9}}, "0.202:1 0.201:1 | 0.1/100:1 0.2/9:1 +2"},
         {B, {B}, {{low, 9}}, "0.202:2 0.201:1 | 0.1/100:1 0.2/9:2 +2"},
         {A, {A, B}, {{US, 100}}, "0.202:2 0.201:1 | 0.1/100:1 0.2/9:1 +1"},
         {B, {}, {}, "0.202:1 0.201:1 | 0.1/100:1 +2"},
-        // Of an address that occurs more than once in a report the first occurrence counts, whether the
-        // address is new or known; the others take no place in the router's arrays.
+        // Of a repeated address in a report, new or known, only the first occurrence is stored.
         {A, {A, A}, {{US, 100}, {low, 9}, {US, 50}, {low, 9}}, "0.201:1 | 0.1/100:1 0.2/9:1 +2"},
         {B, {}, {{low, 9}, {low, 9}}, "0.201:1 | 0.1/100:1 0.2/9:2 +1"},
         {A, {A, A}, {{US, 100}, {low, 9}, {US, 50}, {low, 9}}, "0.201:1 | 0.1/100:1 0.2/9:2 +0"},
         {A, {A}, {{low, 9}, {US, 100}}, "0.201:1 | 0.1/100:1 0.2/9:2 +0"},
         {A, {A, A}, {{low, 9}, {low, 9}}, "0.201:1 | 0.2/9:2 +1"},
         {A, {}, {}, "| 0.2/9:1 +2"},
-        // A weight follows the last report that differs from its router's own, which is no change of the
-        // view.
+        // A weight is that of the last report that differs from its router's earlier one. The view does not
+        // change.
         {A, {}, {{low, 9}, {US, 8}}, "| 0.2/9:2 0.1/8:1 +1"},
         {B, {}, {{low, 5}, {US, 3}}, "| 0.1/8:2 0.2/5:2 +1"},
         {B, {}, {{low, 5}, {US, 8}}, "| 0.1/8:2 0.2/5:2 +0"},
@@ -93,7 +92,7 @@ TEST_F(ViewTest, ReportsMoveTheUnion) {
         EXPECT_EQ((router(A)->flags & WCCP_RTR_TWO_WAY) != 0,
                   wccp_get_router_appliance_view_element(router(A), US) != nullptr);
     }
-    // An entry that is there already is logged and goes directly after the head.
+    // A duplicate entry is logged and inserted after the head.
     auto *again = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof(wccp_view_appliance)));
     again->ipa = US;
     again->weight = 8;
@@ -104,7 +103,7 @@ TEST_F(ViewTest, ReportsMoveTheUnion) {
 }
 
 TEST_F(ViewTest, TheSameReportInAnyOrderIsNoChange) {
-    EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, US), 1); // by none
+    EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, US), 1); // no senders
     std::vector<be32> routers;
     reported_appliances list;
     for (uint32_t i = 0; i < 32; i++) {
@@ -115,9 +114,9 @@ TEST_F(ViewTest, TheSameReportInAnyOrderIsNoChange) {
         see(ROUTER_A, routers, list);
         EXPECT_EQ(group->change_number, 2u);
         const wccp_sending_router *a = router(ROUTER_A);
-        // A dump shows whether the last report named what the one before it did.
+        // The marks, which a dump shows.
         EXPECT_EQ(a->view_routers[31].flags + a->view_appliances[0].flags, round == 0 ? 0u : 2u);
-        EXPECT_EQ(a->view_appliances[0].ipa, list[0].first); // the arrays follow the report's order
+        EXPECT_EQ(a->view_appliances[0].ipa, list[0].first); // in the order of the report
         if (round == 1) {
             std::swap(routers[3], routers[31]);
             std::swap(list[0], list[17]);
@@ -125,7 +124,7 @@ TEST_F(ViewTest, TheSameReportInAnyOrderIsNoChange) {
     }
 }
 
-TEST_F(ViewTest, ARouterIsTwoWayWhileItListsUs) {
+TEST_F(ViewTest, ARouterIsTwoWayWhileItListsThisAppliance) {
     group->ucast_router_count = 1;
     wccp_g.seconds = 100;
     const wccp_sending_router *a = router(ROUTER_A);
@@ -161,8 +160,8 @@ TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     EXPECT_EQ(group->assign_timer.countdown, 1u);
     EXPECT_EQ(group->pending_acks, 1);
     EXPECT_EQ(router(ROUTER_A)->assign_tx_count, 0u);
-    // With nobody left that all routers report the update fails, but the report is taken to its end: what it
-    // names can go again with the next one.
+    // When no appliance is left that all routers report, the update fails, but the whole report is applied,
+    // so that the next one can remove it again.
     const be32 lowest = to_be32(0x0a000000);
     report(ROUTER_B, {{host(3), 100}});
     EXPECT_EQ(report(ROUTER_A, {{lowest, 1}, {US, 150}, {host(4), 1}}), 1);
@@ -174,7 +173,7 @@ TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     EXPECT_EQ(views(), "| 0.1/150:2 0.3/100:2 +2");
 }
 
-TEST_F(ViewTest, EarlierBucketBitsStayWhereNoneAreAssigned) {
+TEST_F(ViewTest, WithoutBucketsTheEarlierBitsStay) {
     wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES] = {};
     decoded[0] = {US, 100, 0, 1, 256, {0, 0, 0, 8}};
     wccp_sending_router *a = router(ROUTER_A);
@@ -185,8 +184,8 @@ TEST_F(ViewTest, EarlierBucketBitsStayWhereNoneAreAssigned) {
     EXPECT_EQ(a->view_appliances[0].bucket_bits[3], 8u);
 }
 
-// What routers assign to us and to anybody, step by step; then how many redirect here, the state, and the
-// line.
+// What a router assigns to this appliance and to all; then the number of routers that redirect here, the
+// state, and the log line.
 TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
     const be32 A = ROUTER_A, B = ROUTER_B, C = ROUTER_C;
     constexpr uint32_t INIT = WCCP_STATE_INIT, ACTIVE = WCCP_STATE_ACTIVE, BACKUP = WCCP_STATE_BACKUP;
@@ -202,12 +201,12 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
         {B, 128, 256, 2, ACTIVE, 1, ""},
         {A, 0, 256, 1, ACTIVE, 1, ""},
         {A, 0, 200, 1, ACTIVE, 1, ""},
-        // It assigns elsewhere itself, then A still does, then nobody.
+        // B assigns elsewhere; then only A does; then no router.
         {B, 0, 256, 0, BACKUP, 2, "last router stopped redirecting to self. (router id 10.0.0.202)"},
         {B, 256, 256, 1, ACTIVE, 3, "first router to self (router id 10.0.0.202 )"},
         {B, 0, 0, 0, BACKUP, 4, "this rtr (id 10.0.0.202) does not redirect. but another router does"},
         {A, 0, 0, 0, INIT, 4, "no routers redirecting to group (router id 10.0.0.201)"},
-        // The only ones stop.
+        // Both stop.
         {A, 256, 256, 1, ACTIVE, 5, "first router to self (router id 10.0.0.201 )"},
         {B, 256, 256, 2, ACTIVE, 5, ""},
         {B, 0, 0, 1, ACTIVE, 5, ""},
@@ -225,7 +224,7 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
     log_lines log;
     const auto assign = [this](be32 id, uint16_t self, uint16_t total) {
         wccp_sending_router *from = router(id);
-        // As a view update leaves it: the rest goes to the other appliance.
+        // As a view update leaves it: the other appliance has the rest.
         from->view_appliances[0].buckets_assigned = self;
         from->view_appliances[1].buckets_assigned = static_cast<uint16_t>(total - self);
         const wccp_assign_summary hash = {1, self, total}, mask = {};
@@ -243,13 +242,13 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
         EXPECT_EQ(said.find(begin) == std::string::npos, step.line.empty()) << said;
         EXPECT_TRUE(step.line.empty() || said.find(begin + step.line) != std::string::npos) << said;
     }
-    // Nothing is taken from an empty count, as a start of the group leaves it.
+    // A count of 0, as after a start of the group, does not wrap.
     for (const uint16_t total : {uint16_t{256}, uint16_t{0}}) {
         router(A)->self_buckets = router(A)->total_buckets = 9;
         assign(A, 0, total);
         EXPECT_EQ(group->redirecting_routers, 0);
     }
-    // A map wins over the hash, and the same again counts nothing.
+    // A map takes precedence, and a repetition changes nothing.
     const wccp_assign_summary hash = {1, 0, 0}, mask = {1, 8, 16};
     const uint32_t checks = group->alarm_assign_sched;
     for (int round = 0; round < 2; round++) {

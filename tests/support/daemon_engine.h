@@ -1,5 +1,5 @@
-// The engine under the whole daemon in a test, without threads, sockets and a session: one interface that is
-// there but not ready, so that groups are kept and nothing is sent.
+// The engine for tests of the daemon, without threads, sockets or a session. Its interface is not ready, so
+// that groups exist and nothing is sent.
 #pragma once
 
 #include <cstring>
@@ -38,7 +38,7 @@ struct daemon_engine {
     daemon_engine &operator=(const daemon_engine &) = delete;
 };
 
-// An array of bindings, made by hand.
+// An array of bindings.
 struct binding_list {
     owner<bn_binding_array, bn_binding_array_free> array;
 

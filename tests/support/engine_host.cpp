@@ -1,4 +1,4 @@
-// What the engine asks of the program around it, for tests: all of it is set by hand.
+// What the engine needs from its program, for tests.
 #include <cstring>
 
 #include "engine/wccp_host.h"

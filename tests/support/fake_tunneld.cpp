@@ -22,7 +22,7 @@ fake_tunneld::~fake_tunneld() {
 void fake_tunneld::answer_with(answer_fn next) {
     const std::lock_guard lock(mutex);
     answer = std::move(next);
-    pending = false; // and what waits is looked at again
+    pending = false; // a command that is waiting is read again
 }
 
 std::vector<seen_command> fake_tunneld::take_commands() {
@@ -71,8 +71,8 @@ std::optional<tunneld_answer> tunneld_is_silent(const seen_command &) {
     return std::nullopt;
 }
 
-// A process makes its block once. A test that starts the engine again plays a new process: the records of the
-// blocks are cleared, the segments stay.
+// A process creates its block only once. For a test that starts the engine again, the records of the blocks
+// are cleared; the segments remain.
 static void forget_blocks() {
     constexpr size_t RECORD_BYTES = 336000;
     const int id = shmget(CMEM_REGISTRY_KEY, 0, 0);

@@ -1,4 +1,4 @@
-// tunneld's side of the mailbox on a thread of a test: records each command and answers as the test wants.
+// tunneld's side of the mailbox, on a thread: records each command and answers as the test wants.
 #pragma once
 
 #include <atomic>
@@ -25,7 +25,7 @@ struct tunneld_answer {
 };
 
 struct fake_tunneld {
-    // Called for each command, on the thread. Nothing: it stays unanswered.
+    // Called for each command, on the thread. std::nullopt: no answer.
     using answer_fn = std::function<std::optional<tunneld_answer>(const seen_command &)>;
     explicit fake_tunneld(answer_fn answer);
     ~fake_tunneld();
@@ -34,7 +34,7 @@ struct fake_tunneld {
 
     void answer_with(answer_fn answer);
     std::vector<seen_command> take_commands();
-    // Until a command has been seen that is still unanswered.
+    // Waits until there is a command without an answer.
     void wait_for_command();
 
 private:
@@ -47,11 +47,10 @@ private:
     std::thread thread;
 };
 
-// Every command done: adds get index 1000 + tunnel id.
+// Success; an add gets the index 1000 + tunnel id.
 std::optional<tunneld_answer> tunneld_does(const seen_command &command);
-// No command answered.
+// No answer.
 std::optional<tunneld_answer> tunneld_is_silent(const seen_command &command);
 
-// Writes the configuration file with the mailbox's line, and lets the process create its block once more.
-// Call it before wccp_init_shmem.
+// Writes mem.conf and lets this process create the mailbox again. Call it before wccp_init_shmem.
 void write_mem_conf();

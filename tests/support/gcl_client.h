@@ -1,4 +1,4 @@
-// A session with all that it is built on, as the daemon puts it together, and a body protocol that records.
+// A client session on an event loop, as in the daemon, with a body protocol that records frames.
 #pragma once
 
 #include <functional>

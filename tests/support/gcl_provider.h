@@ -1,4 +1,4 @@
-// A provider of sessions for tests, made by hand of raw bytes: it shares no code with the client.
+// A provider of sessions for tests, from raw bytes: it shares no code with the client.
 #pragma once
 
 #include <cstdint>
@@ -93,7 +93,7 @@ struct gcl_provider {
             unread.append(bytes, static_cast<size_t>(got));
         }
     }
-    // The other side of a session's opening.
+    // The provider's part of opening a session.
     bool open_session() {
         if (!accept_client() || !put(greeting_bytes(~0u, ~0u)) || take_frame().empty())
             return false;

@@ -1,5 +1,5 @@
-// A client session whose loop and whose provider are played by the thread that has it: what it sends is taken
-// from the provider's end, what the provider sends reaches it in deliver().
+// A client session without a loop, on the same thread as its provider: the test reads what it sends from the
+// provider, and deliver() passes it what the provider sends.
 #pragma once
 
 #include <thread>
@@ -24,7 +24,7 @@ struct hand_session {
     }
     hand_session(const hand_session &) = delete;
     hand_session &operator=(const hand_session &) = delete;
-    // After the callbacks are set; a session takes them when it is made.
+    // Call it after the callbacks are set: a session copies them when it is created.
     bool open() {
         if (!provider.listen_as("hand") ||
             gcl_session_client_new(instance, "hand", nullptr, 0, &session) != LC_OK ||

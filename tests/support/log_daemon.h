@@ -1,4 +1,4 @@
-// A log daemon for tests of the runtime: owns /dev/log, reads on request.
+// A log daemon for tests: owns /dev/log and reads on request.
 #pragma once
 
 #include <cstring>
@@ -40,7 +40,7 @@ struct log_daemon {
         unlink("/dev/log");
     }
 
-    // Everything that arrives until nothing has come for `quiet_ms`, or until there are `enough` lines.
+    // The lines that arrive until there has been none for `quiet_ms`, or until there are `enough`.
     std::vector<std::string> take(int quiet_ms = 20, size_t enough = SIZE_MAX) {
         std::vector<std::string> lines;
         for (;;) {
@@ -72,7 +72,7 @@ struct log_daemon {
                 lines.push_back(partial.substr(0, end));
         }
     }
-    // The one line that came, else a text with the number that did.
+    // The only line that has arrived, otherwise a text with their number.
     std::string one() {
         const std::vector<std::string> lines = take();
         return lines.size() == 1 ? lines[0] : std::to_string(lines.size()) + " lines";

@@ -1,5 +1,5 @@
-// The log of a test: takes /dev/log for its lifetime and lets every level but debug through. What comes waits
-// in the socket's queue, which is short: take it after each step.
+// The log lines of a test, all but debug. It owns /dev/log. Lines wait in the socket's short queue: take them
+// after each step.
 #pragma once
 
 #include <string>
@@ -10,9 +10,9 @@ struct log_lines {
     log_lines(const log_lines &) = delete;
     log_lines &operator=(const log_lines &) = delete;
 
-    // All lines since the last call, each as its datagram was.
+    // All lines since the last call.
     std::string take();
-    // Whether they hold this text.
+    // Whether the lines since the last call contain this text.
     bool say(const std::string &text) { return take().find(text) != std::string::npos; }
 
     int fd;

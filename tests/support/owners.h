@@ -1,4 +1,4 @@
-// Owners for the objects of the foundation in tests.
+// Owners of objects in tests.
 #pragma once
 
 #include <cstdlib>
@@ -24,7 +24,7 @@ struct owner {
     operator T *() const { return pointer; }
 };
 
-// The text that `call(&text)` gives, freed.
+// The text that `call(&text)` outputs; the original is freed.
 template <typename Call>
 std::string text_of(Call call) {
     char *text = nullptr;

@@ -1,5 +1,5 @@
-// A service group that learns of routers and appliances by the engine's own calls, with no packet and no
-// network. Its one interface is ready but has no sockets: what it sends is built and counted.
+// A service group whose routers report by direct calls, without packets or a network. Its interface is ready
+// but has no sockets: messages are built and counted, but not sent.
 #pragma once
 
 #include <string>
@@ -17,31 +17,31 @@ constexpr be32 ROUTER_A = host(201), ROUTER_B = host(202), ROUTER_C = host(203);
 using reported_appliances = std::vector<std::pair<be32, uint16_t>>; // address and weight
 
 struct reported_group {
-    // An enabled group in the engine's tables; started, or as an addition leaves it.
+    // An enabled group in the engine's tables, started or not.
     explicit reported_group(bool started, uint8_t id = 51);
-    ~reported_group(); // takes it out again, with all that it has
+    ~reported_group(); // removes it, with everything that it owns
     reported_group(const reported_group &) = delete;
     reported_group &operator=(const reported_group &) = delete;
 
-    // The sending router of an id. A new one offers L2 both ways and hash: it needs no tunnel.
+    // The sending router with this id, created if necessary: L2 and hash, without a tunnel.
     wccp_sending_router *router(be32 id) const;
     int report_routers(be32 from, const std::vector<be32> &list) const;
     int report(be32 from, const reported_appliances &list) const;
-    // A complete I-See-You: it counts as a sign of life, too.
+    // Both reports of an I-See-You; renews the hold time.
     void see(be32 from, const std::vector<be32> &routers, const reported_appliances &appliances) const;
 
     wccp_interface interface = {};
     wccp_service_group *group;
 };
 
-// The reasons of a group, or of no group, and none of them afterwards: "CODE SENDER: OFFERED|WANTED xCOUNT"
-// each, the sender and the count only where there is one and more than one, and a ";" in between.
+// Returns and removes the reasons of a group, or of packets of no group: "CODE SENDER: OFFERED|WANTED
+// xCOUNT", separated by "; ". The sender is left out if there is none, and a count of 1.
 std::string take_reasons(wccp_service_group *group);
 
-// As a base before reported_group: at the end of a test all that the engine allocated is free again.
+// A base class before reported_group: checks at the end of a test that the engine has freed all memory.
 struct all_freed {
     ~all_freed();
 };
 
-// Ticks of the engine.
+// Calls the tick so many times.
 void pass_seconds(uint32_t seconds);

@@ -1,11 +1,12 @@
-// Messages written byte by byte, as the wire has them: numbers with their size, big-endian, one after the
-// other. Knows no layout, so that a test states each one itself.
+// Bytes as they are on the wire, appended one number after the other, big-endian. It knows no layout.
 #pragma once
 
 #include <cctype>
 #include <cstdint>
 #include <string>
 #include <vector>
+
+#include "runtime/byte_order.h"
 
 struct wire_bytes {
     std::vector<uint8_t> bytes;
@@ -16,7 +17,11 @@ struct wire_bytes {
     }
     wire_bytes &u16(uint32_t value) { return u8(value >> 8).u8(value); }
     wire_bytes &u32(uint32_t value) { return u16(value >> 16).u16(value); }
-    // 10.0.<third>.<fourth>, the addresses that tests live on.
+    wire_bytes &addr(be32 address) {
+        bytes.insert(bytes.end(), address.bytes, address.bytes + 4);
+        return *this;
+    }
+    // 10.0.<third>.<fourth>
     wire_bytes &ip(uint32_t third, uint32_t fourth) { return u8(10).u8(0).u8(third).u8(fourth); }
     wire_bytes &zeros(size_t count) { return fill(count, 0); }
     wire_bytes &fill(size_t count, uint8_t value) {
@@ -27,8 +32,7 @@ struct wire_bytes {
         bytes.insert(bytes.end(), other.bytes.begin(), other.bytes.end());
         return *this;
     }
-    // "0002 0004 ee*3": pairs of hexadecimal digits, anything else between them; a star repeats the last byte
-    // to so many.
+    // "0002 0004 ee*3": pairs of hexadecimal digits; other characters separate. "ee*3" is ee three times.
     wire_bytes &hex(const std::string &digits) {
         std::string pair;
         for (size_t at = 0; at < digits.size(); at++) {
@@ -58,7 +62,7 @@ inline wire_bytes hex(const std::string &digits) {
     return wire_bytes().hex(digits);
 }
 
-// A message: its eight header bytes, then its components.
+// A message: the header with the right length, then its components.
 inline std::vector<uint8_t> wire_message(uint32_t type, const std::vector<wire_bytes> &components) {
     wire_bytes out;
     out.u32(type).u16(0x0200).u16(0);
