@@ -92,8 +92,11 @@ TEST_F(DaemonConfig, AGroupIsBuiltFromItsWholeSubtree) {
         EXPECT_EQ(node.field(*group), node.wanted) << node.node;
     for (const auto &[line, count] :
          {std::pair{"WCCP config query group 51(51) - /qv/wccpd/wccp/srv_grp/config/51", 2},
-          {"WCCP config: set router ip to 10.0.0.201, position 0", 1},
-          {"WCCP config: set password", 1},
+          {"WCCP config: set router ip to 10.0.0.201, position 0", 2},
+          {"WCCP config: set force l2 return to yes", 2},
+          {"WCCP config: set mask src ip to 0x1741", 2},
+          {"WCCP config: set compatibility mode to nexus(2)", 2},
+          {"WCCP config: set password", 2},
           {"twelve", 0},
           {"FAILED to create WCCP group 51", 1}})
         EXPECT_EQ(said(line), count) << line;

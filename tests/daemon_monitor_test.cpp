@@ -271,19 +271,12 @@ TEST_F(DaemonMonitor, Lists) {
     second->view_appliance_count = 2;
     second->view_appliances[0].ipa = address(9);
     second->view_appliances[1].ipa = address(1);
-    const std::pair<const char *, const char *> lists[] = {
-        {"", "0 51 200 "},
-        {"/51/router", "1 2 "},
-        {"/51/router/2/appliance", "10.0.0.9 10.0.0.1 "},
-        {"/200/router", ""},
-        {"/51", ""},
-        {"/51/router/1/appliance", ""},
-        {"/51/appliance", ""},
-        {"/7/router", ""},
-        {"/51/router/3/appliance", ""},
-    };
-    for (const auto &[node, names] : lists)
-        EXPECT_EQ(children(STATE + node), names) << node;
+    std::string found;
+    for (const char *node :
+         {"", "/51/router", "/51/router/2/appliance", "/51", "/200/router", "/51/router/1/appliance",
+          "/51/appliance", "/7/router", "/51/router/3/appliance"})
+        found += children(STATE + node) + "|";
+    EXPECT_EQ(found, "0 51 200 |1 2 |10.0.0.9 10.0.0.1 |||||||");
     for (const std::string line :
          {"wccp_get_router_list: failed: status=1", "wccp_get_router_appliance_list failed: status=1"})
         EXPECT_EQ(said(line), 1) << line;

@@ -5,17 +5,11 @@
 #include <algorithm>
 #include <array>
 #include <cstdlib>
-#include <cstring>
 #include <memory>
 #include <sstream>
-#include <string>
-#include <vector>
-
-#include <gtest/gtest.h>
 
 #include "engine/wccp_mask_assignment.h"
 #include "engine/wccp_slot_owners.h"
-#include "engine/wccp_utils.h"
 #include "tests/support/reported_group.h"
 
 namespace {

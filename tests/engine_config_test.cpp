@@ -1,21 +1,10 @@
 // Groups as configuration adds, changes, starts, stops and queries them, on a real interface whose other end
 // is in another namespace. At the end of each test the tables must be consistent.
 
-#include "engine/wccp_config.h"
 #include "engine/wccp_query.h"
 
-#include <gtest/gtest.h>
-
-#include <cstring>
-#include <string>
-
-#include "engine/wccp_interface.h"
-#include "engine/wccp_link_mgr.h"
-#include "engine/wccp_utils.h"
-#include "runtime/common.h"
 #include "runtime/list.h"
 #include "tests/support/engine_fixture.h"
-#include "tests/support/log_lines.h"
 
 namespace {
 
@@ -128,25 +117,6 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
     memset(other.interface, 'x', sizeof other.interface); // not terminated
     other.group_id = 63;
     EXPECT_STREQ(add(other)->interfaces[0]->name, "xxxxxxxxxxxxxxx");
-}
-
-TEST_F(Config, AMulticastGroupWaitsForAnAddress) {
-    engine.peer.link("wan1", "", "rt1", "10.2.0.2/24");
-    ASSERT_TRUE(link_becomes("wan1", 1));
-    wccp_grp_config with = config(61, "wan1");
-    with.routers[0] = ipa("224.0.1.5");
-    EXPECT_EQ(wccp_add_group(&with), 1);
-    const wccp_service_group *group = wccp_find_group(61);
-    ASSERT_NE(group, nullptr) << "it stays";
-    EXPECT_EQ(group->state_flags, 0u) << "not started";
-    run_command("ip addr add 10.2.0.1/24 dev wan1");
-    wccp_process_if_ipa_update("wan1");
-    EXPECT_EQ(group->state_flags, WCCP_STATE_INIT);
-    EXPECT_EQ(group->hia_timer.active, 1);
-    EXPECT_EQ(group->appliance_ipa, ipa("10.2.0.1"));
-    EXPECT_EQ(group->interfaces[0]->mcast_bound, 1u);
-    run_command("ip maddr show dev wan1 | grep -q 224.0.1.5");
-    run_command("ip link del wan1");
 }
 
 TEST_F(Config, AGroupStartsAsFarAsItCan) {

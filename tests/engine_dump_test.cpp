@@ -2,18 +2,12 @@
 // is too small.
 #include "engine/wccp_debug_utils.h"
 
-#include <gtest/gtest.h>
-
 #include <algorithm>
-#include <cstring>
 #include <fstream>
-#include <functional>
 #include <map>
 #include <memory>
-#include <string>
 
 #include "runtime/csys.h"
-#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
 namespace {

@@ -1,9 +1,5 @@
 // Start and stop of the engine in both modes, the tick, allocation and text helpers, and the named threads.
 
-#include "engine/wccp_mgr.h"
-#include "engine/wccp_utils.h"
-
-#include <gtest/gtest.h>
 #include <pthread.h>
 #include <sched.h>
 #include <signal.h>
@@ -11,16 +7,9 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstring>
-#include <string>
 
-#include "engine/cthread.h"
-#include "engine/wccp_config.h"
-#include "engine/wccp_host.h"
-#include "engine/wccp_link_mgr.h"
 #include "engine/wccpd_common.h"
 #include "platform/qvcommon.h"
-#include "runtime/common.h"
 #include "tests/support/engine_fixture.h"
 #include "tests/support/fake_tunneld.h"
 

@@ -1,12 +1,10 @@
 // Interfaces on a real veth pair, whose other end is in the routers' namespace: the sockets, the table of
 // interfaces, and notifications, called directly in each order that the kernel may choose.
 
-#include "engine/wccp_network.h"
 #include "engine/wccp_packet_io.h"
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <poll.h>
 #include <sys/resource.h>
@@ -15,23 +13,23 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <csignal>
 #include <cstdio>
-#include <cstring>
-#include <functional>
-#include <utility>
 
-#include "engine/cthread.h"
-#include "engine/wccp_config.h"
-#include "engine/wccp_host.h"
-#include "engine/wccp_interface.h"
-#include "engine/wccp_link_mgr.h"
-#include "engine/wccp_mgr.h"
-#include "engine/wccp_utils.h"
 #include "platform/limits.h"
-#include "runtime/common.h"
 #include "tests/support/engine_fixture.h"
-#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
+
+static std::function<void()> after_wait; // called once, when a descriptor is ready
+
+// Replaces the C library's, so that descriptors can change between a receiver's wait and its read.
+extern "C" int poll(pollfd *fds, nfds_t count, int wait_ms) {
+    const timespec limit = {wait_ms / 1000, wait_ms % 1000 * 1000000L};
+    const int ready = ppoll(fds, count, wait_ms < 0 ? nullptr : &limit, nullptr);
+    if (ready > 0 && after_wait)
+        std::exchange(after_wait, nullptr)();
+    return ready;
+}
 
 namespace {
 
@@ -237,6 +235,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
             log.take();
             EXPECT_EQ(wccp_add_group(&multicast), 1);
             EXPECT_EQ(count_of("WCCP: net init", log.take()), 0u) << "one attempt in a second";
+            EXPECT_EQ(wccp_find_group(62)->state_flags, 0u) << "it exists, but is not started";
             EXPECT_EQ(take_reasons(wccp_find_group(62)), &cause == causes
                                                              ? "port-taken: Address already in use|wan0"
                                                              : "socket-failed: Too many open files|wan0");
@@ -436,6 +435,36 @@ TEST_F(Network, OneDatagramIsReadAtATimeAndTheMulticastSocketFirst) {
     send("10.0.0.100", 3000, 5);
     EXPECT_EQ(wccp_rx_pkt(wan, &pkt, 100), 100);
     EXPECT_TRUE(pkt.data[99] == 5 && pkt.data[100] == 0);
+}
+
+TEST_F(Network, DescriptorsChangeBetweenTheWaitAndTheRead) {
+    // Ends a read that blocks. The first process of a namespace only receives signals that it handles.
+    signal(SIGALRM, [](int) { _exit(1); });
+    alarm(20);
+    const int router = engine.router_socket("10.0.0.2");
+    wccp_pkt pkt = {};
+    // A new socket, which is empty.
+    send_datagram(router, "10.0.0.100", WCCP_PORT, {1, 2, 3, 4});
+    after_wait = [&] { EXPECT_EQ(wccp_init_network_by_interface(wan), 0); };
+    EXPECT_LT(wccp_rx_pkt(wan, &pkt, sizeof pkt.data), 1);
+    EXPECT_EQ(after_wait, nullptr);
+    // Another file, from which nothing may be read.
+    send_datagram(router, "10.0.0.100", WCCP_PORT, {1, 2, 3, 4});
+    int other = -1;
+    after_wait = [&] {
+        const int number = wan->ucast_fd;
+        wccp_close_sockets(wan);
+        int pair[2];
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_DGRAM, 0, pair), 0);
+        ASSERT_EQ(write(pair[1], "theirs", 6), 6);
+        other = dup2(pair[0], number);
+    };
+    EXPECT_LT(wccp_rx_pkt(wan, &pkt, sizeof pkt.data), 1);
+    ASSERT_GE(other, 0);
+    char bytes[8] = {};
+    EXPECT_EQ(recv(other, bytes, sizeof bytes, MSG_DONTWAIT), 6);
+    close(other);
+    alarm(0);
 }
 
 TEST_F(Network, TheKernelIsAskedForAddressAndState) {

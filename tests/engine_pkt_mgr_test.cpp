@@ -3,17 +3,12 @@
 
 #include "engine/wccp_pkt_mgr.h"
 
-#include <gtest/gtest.h>
-
 #include <array>
-#include <cstring>
-#include <functional>
 #include <sstream>
 
 #include "engine/wccp_complaints.h"
 #include "engine/wccp_router_utils.h"
 #include "tests/support/engine_fixture.h"
-#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 #include "tests/support/router_messages.h"
 

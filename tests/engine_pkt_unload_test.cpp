@@ -3,13 +3,9 @@
 
 #include "engine/wccp_pkt_unload.h"
 
-#include <gtest/gtest.h>
-
 #include <bit>
-#include <cstring>
 
 #include "tests/support/engine_fixture.h"
-#include "tests/support/log_lines.h"
 #include "tests/support/wire_bytes.h"
 
 namespace {

@@ -1,14 +1,7 @@
 // Sending routers: the capability decision, creation and its limits, removal, and Removal Queries.
 #include "engine/wccp_router_utils.h"
 
-#include <cstring>
-#include <string>
-#include <vector>
-
-#include <gtest/gtest.h>
-
 #include "engine/wccp_state.h"
-#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
 namespace {

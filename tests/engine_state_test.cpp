@@ -4,10 +4,6 @@
 
 #include <map>
 #include <sstream>
-#include <string>
-#include <vector>
-
-#include <gtest/gtest.h>
 
 #include "engine/wccp_alarms.h"
 #include "engine/wccp_config.h"
@@ -15,7 +11,6 @@
 #include "engine/wccp_router_utils.h"
 #include "platform/qvcommon.h"
 #include "runtime/logging.h"
-#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
 static std::vector<std::string> state_events; // constant, group, role and code of each

@@ -2,7 +2,6 @@
 // change while receivers wait. An alarm ends the program if a thread never returns.
 
 #include <arpa/inet.h>
-#include <gtest/gtest.h>
 #include <net/if.h>
 #include <signal.h>
 #include <sys/ioctl.h>
@@ -11,24 +10,12 @@
 
 #include <atomic>
 #include <chrono>
-#include <cstring>
-#include <functional>
 #include <optional>
-#include <string>
 #include <thread>
 
-#include "engine/cthread.h"
-#include "engine/wccp_config.h"
-#include "engine/wccp_host.h"
-#include "engine/wccp_interface.h"
-#include "engine/wccp_link_mgr.h"
-#include "engine/wccp_mgr.h"
-#include "engine/wccp_network.h"
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_router_utils.h"
-#include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"
-#include "runtime/common.h"
 #include "tests/support/engine_fixture.h"
 #include "tests/support/fake_tunneld.h"
 #include "tests/support/router_messages.h"

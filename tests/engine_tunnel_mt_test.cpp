@@ -2,16 +2,12 @@
 
 #include "engine/wccp_tunnel.h"
 
-#include <gtest/gtest.h>
-
 #include <set>
-#include <string>
 
 #include "engine/wccp_host.h"
 #include "engine/wccp_router_utils.h"
 #include "engine/wccpd_common.h"
 #include "tests/support/fake_tunneld.h"
-#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
 namespace {

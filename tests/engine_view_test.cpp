@@ -3,17 +3,10 @@
 #include "engine/wccp_view_utils.h"
 
 #include <sstream>
-#include <string>
-#include <utility>
-#include <vector>
-
-#include <gtest/gtest.h>
 
 #include "engine/wccp_pkt_unload.h"
 #include "engine/wccp_state.h"
-#include "engine/wccp_utils.h"
 #include "runtime/list.h"
-#include "tests/support/log_lines.h"
 #include "tests/support/reported_group.h"
 
 namespace {

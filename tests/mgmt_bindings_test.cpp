@@ -5,7 +5,7 @@
 #include <vector>
 
 #include "mgmt/bnode_proto.h"
-#include "tests/support/log_lines.cpp" // this program is linked without the engine's helpers
+#include "tests/support/log_lines.h"
 #include "tests/support/owners.h"
 
 namespace {

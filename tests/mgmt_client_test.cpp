@@ -7,7 +7,7 @@
 #include "mgmt/mdc_main.h"
 #include "runtime/logging.h"
 #include "tests/support/hand_session.h"
-#include "tests/support/log_lines.cpp" // this program is linked without the engine's helpers
+#include "tests/support/log_lines.h"
 #include "tests/support/owners.h"
 
 using binding_owner = owner<bn_binding, bn_binding_free>;

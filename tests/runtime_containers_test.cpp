@@ -10,7 +10,7 @@
 
 #include "runtime/hash_table.h"
 #include "runtime/typed_arrays.h"
-#include "tests/support/log_lines.cpp" // this program is linked without the engine's helpers
+#include "tests/support/log_lines.h"
 #include "tests/support/owners.h"
 
 namespace {

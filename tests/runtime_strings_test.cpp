@@ -8,7 +8,7 @@
 #include "runtime/tbuffer.h"
 #include "runtime/tstr_array.h"
 #include "runtime/tstring.h"
-#include "tests/support/log_lines.cpp" // this program is linked without the engine's helpers
+#include "tests/support/log_lines.h"
 #include "tests/support/owners.h"
 
 namespace {

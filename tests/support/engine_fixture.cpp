@@ -1,21 +1,12 @@
 #include "tests/support/engine_fixture.h"
 
-#include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <new>
 
-#include "engine/cthread.h"
-#include "engine/wccp_config.h"
-#include "engine/wccp_host.h"
-#include "engine/wccp_link_mgr.h"
-#include "engine/wccp_mgr.h"
-#include "engine/wccp_network.h"
 #include "engine/wccp_tunnel.h"
-#include "engine/wccp_utils.h"
 
 #ifdef WCCP_SANITIZED
 #include <sanitizer/asan_interface.h>

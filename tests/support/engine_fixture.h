@@ -1,13 +1,26 @@
 // The engine in a test: without threads, on an interface whose other end is in another network namespace,
-// where the test has the routers' sockets.
+// where the test has the routers' sockets. Includes what most tests of the engine call.
 #pragma once
 
+#include <cstring>
+#include <functional>
 #include <map>
 #include <memory>
 #include <string>
 #include <vector>
 
-#include "engine/wccp_records.h"
+#include <gtest/gtest.h>
+
+#include "engine/cthread.h"
+#include "engine/wccp_config.h"
+#include "engine/wccp_host.h"
+#include "engine/wccp_interface.h"
+#include "engine/wccp_link_mgr.h"
+#include "engine/wccp_mgr.h"
+#include "engine/wccp_network.h"
+#include "engine/wccp_utils.h"
+#include "runtime/common.h"
+#include "tests/support/log_lines.h"
 #include "tests/support/peer_network.h"
 
 // The result of wccp_is_system_in_bridge_mode.

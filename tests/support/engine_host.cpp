@@ -1,7 +1,5 @@
 // What the engine needs from its program, for tests.
-#include <cstring>
 
-#include "engine/wccp_host.h"
 #include "tests/support/engine_fixture.h"
 
 std::atomic<int32_t> wccpd_exiting;

@@ -1,14 +1,9 @@
 #include "tests/support/reported_group.h"
 
-#include <gtest/gtest.h>
-
-#include <cstring>
-
 #include "engine/wccp_config.h"
 #include "engine/wccp_mgr.h"
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_router_utils.h"
-#include "engine/wccp_utils.h"
 #include "engine/wccp_view_utils.h"
 #include "runtime/list.h"
 

@@ -2,11 +2,17 @@
 // but has no sockets: messages are built and counted, but not sent.
 #pragma once
 
+#include <cstring>
+#include <functional>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include <gtest/gtest.h>
+
 #include "engine/wccp_records.h"
+#include "engine/wccp_utils.h"
+#include "tests/support/log_lines.h"
 
 constexpr be32 host(uint32_t last_octet) { // 10.0.0.x
     return to_be32(10u << 24 | last_octet);
