@@ -1,0 +1,210 @@
+// mgmtd without sockets: messages are kept instead of being sent. Change events are read with the client
+// library that wccpd reads them with.
+#pragma once
+
+#include <algorithm>
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "mgmt/bnode_proto.h"
+#include "mgmt/mdc_main.h"
+#include "mgmt/node_paths.h"
+#include "peers/mgmtd/server.h"
+
+inline const std::string GROUP = "/qv/wccpd/wccp/srv_grp/config/51";
+inline const std::string STATE = "/qv/wccpd/wccp/srv_grp/state";
+
+using strings = std::vector<std::string>;
+
+inline bool has(const strings &list, const std::string &wanted) {
+    return std::find(list.begin(), list.end(), wanted) != list.end();
+}
+
+inline node_name named(const std::string &text) {
+    node_name out;
+    EXPECT_TRUE(parse_node_name(text, &out)) << text;
+    return out;
+}
+
+struct sent_message {
+    uint32_t peer;
+    uint16_t mtype;
+    bn_request_msg *request = nullptr;
+    bn_response_msg *response = nullptr;
+};
+
+struct Mgmtd : testing::Test {
+    server daemon;
+    int64_t now = 1000;
+    std::vector<sent_message> sent;
+    std::string said;
+    uint32_t asker = 3; // whose set requests are
+    char file[32] = "/tmp/mgmtd-test-XXXXXX";
+
+    void SetUp() override {
+        ASSERT_TRUE(mkdtemp(file));
+        daemon.file.path = std::string(file) + "/conf";
+        daemon.now_ms = [this] { return now; };
+        daemon.say = [this](const std::string &line) { said += line + "\n"; };
+        daemon.local_addresses = [] { return std::vector<local_address>{{0x0a000065, 0x0a0000ff}}; };
+        daemon.send = [this](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
+            const owned_tbuffer buffer(frame);
+            sent_message message{peer_id, mtype};
+            if (mtype % 2 == 1)
+                ASSERT_EQ(bn_request_msg_deserialize(frame, 32, &message.request), LC_OK);
+            else
+                ASSERT_EQ(bn_response_msg_deserialize(frame, 32, &message.response), LC_OK);
+            sent.push_back(message);
+        };
+        tree_refresh(&daemon.tree);
+        server_peer_opened(&daemon, 1, "wccpd-7"); // the working session
+        server_peer_opened(&daemon, 2, "wccpd-7"); // the alarm session
+        server_peer_opened(&daemon, 3, "mgmtctl-8");
+        action(1, "/mgmtd/events/actions/interest/add",
+               {{"event_name", {bn_type_name, EVENT_CONFIG_CHANGE}},
+                {"match/1/pattern", {bn_type_str, "/qv/wccpd/**"}},
+                {"match/2/pattern", {bn_type_str, "/qv/tunneld/system/config/mode/**"}}});
+        EXPECT_EQ(code(), 0u);
+        clear();
+    }
+    void TearDown() override {
+        clear();
+        (void)!system(("rm -rf " + std::string(file)).c_str());
+    }
+    void clear() {
+        for (sent_message &message : sent) {
+            (void)bn_request_msg_free(&message.request);
+            (void)bn_response_msg_free(&message.response);
+        }
+        sent.clear();
+    }
+    bool give(uint32_t peer_id, bn_request_msg *taken) {
+        const owned_request msg(taken);
+        taken->service_id = 2;
+        if (taken->msg_id == 0)
+            taken->msg_id = 77;
+        owned_tbuffer frame;
+        EXPECT_EQ(bn_request_msg_serialize(taken, 32, &frame.pointer), LC_OK);
+        return server_take_frame(&daemon, peer_id, taken->msg_type, frame.pointer);
+    }
+    void action(uint32_t peer_id, const char *name, const std::vector<event_field> &fields) {
+        bn_request_msg *msg = nullptr;
+        ASSERT_EQ(bn_action_request_msg_create(&msg, name), LC_OK);
+        for (const event_field &field : fields) {
+            bn_binding *binding = make_binding(field.name, field.value);
+            ASSERT_EQ(bn_action_request_msg_append_binding_takeover(msg, 0, &binding, nullptr), LC_OK);
+        }
+        EXPECT_TRUE(give(peer_id, msg));
+    }
+    void query(uint32_t peer_id, const std::string &name, uint32_t subop, uint32_t flags = 0) {
+        bn_request_msg *msg = nullptr;
+        ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), LC_OK);
+        ASSERT_EQ(bn_query_request_msg_append_str(msg, subop, flags, name.c_str(), nullptr), LC_OK);
+        EXPECT_TRUE(give(peer_id, msg));
+    }
+    static const bn_request_node *last_node(const bn_request_msg *msg) {
+        return bn_request_per_node_array_get_quick(msg->nodes,
+                                                   bn_request_per_node_array_length_quick(msg->nodes) - 1);
+    }
+    // wccpd's answer.
+    void answer(uint32_t peer_id, uint32_t response_to, uint32_t node_id, uint32_t code,
+                const std::vector<event_field> &fields = {{STATE + "/51/oper", {bn_type_str, "ACTIVE"}}}) {
+        owned_response msg;
+        owned_tbuffer frame;
+        ASSERT_EQ(bn_query_response_msg_create(&msg.pointer, response_to, code, nullptr), LC_OK);
+        for (const event_field &field : fields) {
+            bn_binding *binding = make_binding(field.name, field.value);
+            ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding, node_id), LC_OK);
+        }
+        msg.pointer->service_id = 2;
+        ASSERT_EQ(bn_response_msg_serialize(msg.pointer, 32, &frame.pointer), LC_OK);
+        EXPECT_TRUE(server_take_frame(&daemon, peer_id, bn_msg_query_response, frame.pointer));
+    }
+    struct set_node {
+        uint32_t subop;
+        std::string name, value;
+        uint32_t type = bn_type_str;
+    };
+    uint32_t set(const std::vector<set_node> &nodes, uint32_t commit_flags = 0, uint32_t revision = 0) {
+        bn_request_msg *msg = nullptr;
+        EXPECT_EQ(bn_set_request_msg_create(&msg, commit_flags), LC_OK);
+        msg->number = revision;
+        for (const set_node &node : nodes) {
+            bn_binding *binding = make_binding(node.name, {node.type, node.value});
+            EXPECT_EQ(bn_set_request_msg_append_binding_takeover(msg, node.subop, 0, &binding, nullptr),
+                      LC_OK);
+        }
+        clear();
+        EXPECT_TRUE(give(asker, msg));
+        return code();
+    }
+    const bn_response_msg *last_response() {
+        for (auto at = sent.rbegin(); at != sent.rend(); ++at)
+            if (at->response)
+                return at->response;
+        return nullptr;
+    }
+    uint32_t code() {
+        const bn_response_msg *response = last_response();
+        return response ? response->return_code : UINT32_MAX;
+    }
+    std::string message() { return ts_str(last_response()->return_message); }
+    // "name=value" of each binding of the last response.
+    std::vector<std::string> found() {
+        std::vector<std::string> out;
+        if (const bn_response_msg *response = last_response())
+            for (const event_field &field : fields_of(response))
+                out.push_back(field.name + "=" + field.value.text);
+        return out;
+    }
+    // What the daemon makes of each change event that the peer was sent: "name=old>new", "-" for none.
+    std::vector<std::vector<std::string>> events(uint32_t peer_id = 1) {
+        std::vector<std::vector<std::string>> out;
+        for (const sent_message &one : sent) {
+            if (one.peer != peer_id || one.mtype != bn_msg_event)
+                continue;
+            out.emplace_back();
+            EXPECT_STREQ(ts_str(one.request->text), EVENT_CONFIG_CHANGE);
+            owned_bindings bindings, old_values, new_values;
+            EXPECT_EQ(bn_request_get(one.request, nullptr, nullptr, 0, &bindings.pointer, nullptr, nullptr),
+                      LC_OK);
+            EXPECT_EQ(mdc_event_config_change_notif_extract(bindings.pointer, &old_values.pointer,
+                                                            &new_values.pointer),
+                      LC_OK);
+            for (uint32_t i = 0; i < bn_binding_array_length_quick(new_values.pointer); i++) {
+                const bn_binding *binding = bn_binding_array_get_quick(new_values.pointer, i);
+                const bn_binding *old_value = nullptr;
+                uint32_t flags = 0;
+                (void)bn_binding_array_get_binding_by_name(old_values.pointer, name_of(binding).c_str(),
+                                                           &old_value);
+                (void)bn_binding_get_type(binding, bn_attrib_value, nullptr, &flags);
+                out.back().push_back(name_of(binding) + "=" + (old_value ? value_of(old_value).text : "-") +
+                                     ">" + (flags & bn_flag_deleted ? "-" : value_of(binding).text));
+            }
+        }
+        return out;
+    }
+    std::vector<std::string> changes() {
+        std::vector<std::string> out;
+        for (const std::vector<std::string> &event : events())
+            out.insert(out.end(), event.begin(), event.end());
+        return out;
+    }
+    // The file with this content, and what mgmtd makes of it.
+    void reload(const std::string &content) {
+        std::ofstream(daemon.file.path) << content;
+        clear();
+        said.clear();
+        server_reload(&daemon);
+    }
+    std::string content() const {
+        std::ostringstream out;
+        out << std::ifstream(daemon.file.path).rdbuf();
+        return out.str();
+    }
+};
