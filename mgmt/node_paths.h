@@ -81,3 +81,4 @@
 #define ALARM_TYPE_ADJACENCY 196638  // no router reports this appliance
 #define ALARM_TYPE_ASSIGNMENT 196639 // the table of a router differs from that of the designated appliance
 #define ALARM_TYPE_OVERLOAD 196640   // a proxy has more flows than its intercept allows
+#define ALARM_TYPE_RESTARTS 196641   // a daemon is restarted again and again

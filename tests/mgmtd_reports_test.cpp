@@ -33,9 +33,70 @@ TEST_F(Mgmtd, ProcessesAreKnownByTheirSessions) {
     EXPECT_EQ(process(), wccpd("gone", "9", "1"));
 }
 
+// 3 restarts in 5 minutes raise an alarm, which ends 5 minutes after the last one; whoever counts them.
+TEST_F(Mgmtd, ADaemonThatRestartsInALoopRaisesAnAlarm) {
+    const std::string alarm = NODE_ALARMS_RAISED "/196641/";
+    for (const char *event : {EVENT_RAISE_ALARM, EVENT_CLEAR_ALARM})
+        action(3, ACTION_ADD_INTEREST, {{"event_name", {bn_type_name, event}}});
+    const auto alarms = [&] {
+        strings out;
+        query(3, NODE_ALARMS_RAISED, bn_query_iterate, bn_qf_subtree);
+        for (const std::string &node : found())
+            if (node.find("/since=") == std::string::npos)
+                out.push_back(node.substr(alarm.size()));
+        return out;
+    };
+    const auto heard = [&] {
+        size_t events = 0;
+        for (const sent_message &one : sent)
+            events += one.mtype == bn_msg_event;
+        clear();
+        return events;
+    };
+    server_peer_closed(&daemon, 2);
+    const auto restart = [&](const char *session, int64_t after_ms) {
+        now += after_ms;
+        server_peer_closed(&daemon, 1);
+        server_peer_opened(&daemon, 1, session);
+    };
+    clear();
+    restart("wccpd-8", 1000);
+    restart("wccpd-9", RESTARTS_WITHIN_MS);
+    restart("wccpd-10", 1000);
+    EXPECT_EQ(alarms(), strings{}) << "3 times in more than 5 minutes";
+    restart("wccpd-11", 1000);
+    EXPECT_EQ(alarms(),
+              (strings{"wccpd=restarted 3 times in 2 s", "wccpd/name=restart-loop", "wccpd/reporter=mgmtd"}));
+    restart("wccpd-12", 1000);
+    EXPECT_EQ(alarms()[0], "wccpd=restarted 4 times in 3 s");
+    EXPECT_EQ(heard(), 1u);
+    EXPECT_EQ(server_tick(&daemon), now + RESTARTS_WITHIN_MS);
+    server_peer_closed(&daemon, 1);
+    now += RESTARTS_WITHIN_MS;
+    EXPECT_EQ(server_tick(&daemon), -1) << "it does not run";
+    server_peer_opened(&daemon, 1, "wccpd-13");
+    now += RESTARTS_WITHIN_MS;
+    EXPECT_EQ(heard(), 0u);
+    (void)server_tick(&daemon);
+    EXPECT_EQ(heard(), 1u);
+    EXPECT_EQ(alarms(), strings{});
+
+    // The supervisor's word counts alone, also for a program that never has a session.
+    daemon.supervises = true;
+    for (const char *session : {"wccpd-14", "wccpd-15", "wccpd-16"})
+        restart(session, 1000);
+    EXPECT_EQ(alarms(), strings{});
+    for (int i = 0; i < 3; i++)
+        server_note_restart(&daemon, "tunneld", "exited with 1");
+    EXPECT_EQ(alarms(), (strings{"tunneld=restarted 3 times in 0 s; the last one exited with 1",
+                                 "tunneld/name=restart-loop", "tunneld/reporter=mgmtd"}));
+    query(3, NODE_PROCESSES "/tunneld/restarts", bn_query_get);
+    EXPECT_EQ(found(), strings{NODE_PROCESSES "/tunneld/restarts=3"});
+}
+
 TEST_F(Mgmtd, ReportsStandUntilTheirSessionEndsAndAreBounded) {
-    action(3, "/mgmtd/events/actions/interest/add",
-           {{"event_name", {bn_type_name, "/qv/alarms/events/raise_alarm"}}});
+    for (const char *event : {EVENT_RAISE_ALARM, EVENT_CLEAR_ALARM, EVENT_ROLE_CHANGE})
+        action(3, ACTION_ADD_INTEREST, {{"event_name", {bn_type_name, event}}});
     clear();
     const auto raise = [&](uint32_t peer_id, const std::string &source, const std::string &text) {
         EXPECT_TRUE(give(peer_id,
@@ -57,7 +118,15 @@ TEST_F(Mgmtd, ReportsStandUntilTheirSessionEndsAndAreBounded) {
     EXPECT_EQ(found().size(), 11u) << "four of them about the process";
     EXPECT_TRUE(has(found(), "/qv/alarms/state/role/51=BACKUP") &&
                 has(found(), "/qv/alarms/state/role/51/code=0"));
+    clear();
     server_peer_closed(&daemon, 2);
+    strings forgotten; // what watchers get
+    for (const sent_message &one : sent)
+        for (const event_field &field : fields_of(one.request))
+            forgotten.push_back(field.name + "=" + field.value.text);
+    EXPECT_TRUE(has(forgotten, "param_3=eth0:grp:51") && has(forgotten, "role=2") &&
+                has(forgotten, "group=51"));
+    EXPECT_EQ(sent.size(), 2u);
     query(3, NODE_ALARMS_RAISED, bn_query_iterate, bn_qf_subtree);
     EXPECT_EQ(found(), strings{});
     for (size_t i = 0; i < ALARMS_MAX + 9; i++)

@@ -1,7 +1,7 @@
 #!/bin/bash
 # mgmtd --supervise starts tunneld and wccpd with their options. A tunneld that crashes is replaced without wccpd noticing;
-# one that exits makes wccpd restart as well. SIGHUP applies an edited file, a program that does not exit is killed, and
-# no program outlives an mgmtd that is killed.
+# one that exits makes wccpd restart as well, and one that restarts in a loop raises an alarm. SIGHUP applies an edited
+# file, a program that does not exit is killed, and no program outlives an mgmtd that is killed.
 #   scenario_supervise.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
@@ -37,6 +37,18 @@ start_mgmtd() {
 pid_of() { sed -n "s/^process $1: started, pid //p" $out | tail -n 1; }
 
 ! "$bin/mgmtd" --config $config --supervise --tunneld ' ' >$out 2>&1 || die "mgmtd accepted an empty command"
+# A program that never opens a session.
+"$bin/mgmtd" --config $config --supervise --wccpd false --tunneld "$bin/tunneld --plane table" >$out 2>&1 &
+mgmtd=$!
+wait_line 20 1 "^alarm raised: wccpd restarted 3 times in [0-9]+ s; the last one exited with 1"
+"$bin/mgmtctl" alarms | grep -q 'restart-loop  wccpd *wccpd ends again and again: restarted [3-9] times in [0-9]* s; the last one exited with 1$' ||
+    die "$("$bin/mgmtctl" alarms)"
+"$bin/mgmtctl" explain | grep -q '^  restart-loop: wccpd ends again and again' && "$bin/mgmtctl" show | grep -q '^! wccpd ends again' ||
+    die "$("$bin/mgmtctl" explain; "$bin/mgmtctl" show)"
+"$bin/mgmtctl" metrics | grep -qx 'wccp_alarm_active{alarm="restart-loop",source="wccpd"} 1' && "$bin/mgmtctl" metrics | grep -qx 'wccp_process_restarts_total{process="wccpd"} [3-9]' ||
+    die "$("$bin/mgmtctl" metrics)"
+kill -TERM $mgmtd
+wait $mgmtd || die "mgmtd ended with $?"
 start_mgmtd
 [ "$(tr '\0' ' ' <"/proc/$(pid_of tunneld)/cmdline")" = "$bin/tunneld --plane table " ] || die "the options of tunneld"
 first=$(pid_of wccpd)

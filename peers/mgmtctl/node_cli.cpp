@@ -149,7 +149,7 @@ int ctl_delete(const ctl_options &options, const std::vector<std::string> &names
 
 // --- alarms and completion
 
-// What the alarms of groups come from. A wccpd that is gone, or hangs, raises none: its absence is one.
+// What the alarms come from. A wccpd that is gone, or hangs, raises none: its absence is one.
 static bool explain_alarms(connection *mgmtd, std::vector<ctl_alarm> *inout, bool *out_known) {
     snapshot_limits limits;
     if (inout->empty())
@@ -164,10 +164,11 @@ static bool explain_alarms(connection *mgmtd, std::vector<ctl_alarm> *inout, boo
     const std::vector<reason> reasons = reasons_of(shown);
     for (ctl_alarm &alarm : *inout)
         for (const snapshot_alarm &each : shown.alarms) {
-            const reason *cause = alarm_reason(reasons, each.group, each.name);
+            const reason *cause = alarm_reason(reasons, each.group, each.name, each.source);
             if (cause && alarm.source == each.source && alarm.name == each.name) {
                 alarm.reason = cause->code;
-                alarm.cause = "group " + std::to_string(each.group) + ": " + cause->cause;
+                alarm.cause =
+                    (each.group < 0 ? "" : "group " + std::to_string(each.group) + ": ") + cause->cause;
             }
         }
     *out_known = shown.wccpd == wccpd_condition::running;

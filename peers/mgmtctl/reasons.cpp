@@ -21,6 +21,8 @@ const std::vector<reason_text> &reason_texts() {
         {"tunneld-absent", true, "tunneld has no session: no tunnels, no traffic",
          "start tunneld; its log says why it ended"},
         {"tunneld-silent", true, "tunneld does not answer", "look at its log; when it stays so, restart it"},
+        {"restart-loop", true, "{who} ends again and again: {offered}",
+         "its log says why it ends; the alarm is cleared once it has run for 5 minutes"},
         // A group that cannot begin.
         {"disabled", false, "the group is disabled", "mgmtctl group set {group} admin up"},
         {"no-interface", true, "the group has no interface", "mgmtctl group set {group} interface NAME"},
@@ -352,6 +354,12 @@ std::vector<reason> reasons_of(const snapshot &shown) {
         if (shown.traffic.tunneld != tunneld_condition::running)
             list.add(shown.traffic.tunneld == tunneld_condition::absent ? "tunneld-absent" : "tunneld-silent",
                      -1);
+        for (const snapshot_alarm &alarm : shown.alarms)
+            if (alarm.name == "restart-loop") {
+                reason *made = list.add("restart-loop", -1);
+                made->who = alarm.source;
+                made->offered = alarm.text;
+            }
         add_noted(shown.reasons, -1, &list);
         for (const snapshot_group &group : shown.groups)
             group_reasons(shown, group, &list);
@@ -373,13 +381,12 @@ const reason *main_reason(const std::vector<reason> &reasons, int group) {
     return found == reasons.end() ? nullptr : &*found;
 }
 
-const reason *alarm_reason(const std::vector<reason> &reasons, int group, const std::string &alarm) {
-    if (group < 0)
-        return nullptr;
-    if (alarm == "adjacency" || alarm == "assignment")
+const reason *alarm_reason(const std::vector<reason> &reasons, int group, const std::string &alarm,
+                           const std::string &source) {
+    if (group >= 0 && (alarm == "adjacency" || alarm == "assignment"))
         return main_reason(reasons, group);
     const auto found = std::find_if(reasons.begin(), reasons.end(), [&](const reason &each) {
-        return each.group == group && each.code == alarm;
+        return each.group == group && each.code == alarm && (group >= 0 || each.who == source);
     });
     return found == reasons.end() ? nullptr : &*found;
 }

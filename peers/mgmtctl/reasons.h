@@ -34,8 +34,9 @@ void fill_reason(const std::vector<reason_text> &texts, reason *inout);
 std::vector<reason> reasons_of(const snapshot &shown);
 // The one to begin with; null when nothing of the group needs attention.
 const reason *main_reason(const std::vector<reason> &reasons, int group);
-// What an alarm of a group comes from; null: unknown.
-const reason *alarm_reason(const std::vector<reason> &reasons, int group, const std::string &alarm);
+// What an alarm comes from, by its group (-1: none), name and source; null: unknown.
+const reason *alarm_reason(const std::vector<reason> &reasons, int group, const std::string &alarm,
+                           const std::string &source);
 // "4 times, first 0:01:10 ago, last 0:00:03 ago", or since when; "" where no time is known.
 std::string reason_times(const reason &one);
 // The table as rows of docs/operations.md.

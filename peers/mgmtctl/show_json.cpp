@@ -124,7 +124,7 @@ std::string draw_json(const snapshot &shown) {
     out["alarms_total"] = known ? json(shown.alarms_total) : json(nullptr);
     out["alarms"] = json::array();
     for (const snapshot_alarm &alarm : shown.alarms) {
-        const reason *cause = alarm_reason(reasons, alarm.group, alarm.name);
+        const reason *cause = alarm_reason(reasons, alarm.group, alarm.name, alarm.source);
         out["alarms"].push_back({{"type", alarm.type},
                                  {"name", alarm.name},
                                  {"group", number_or_null(alarm.group)},

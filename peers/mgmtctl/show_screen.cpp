@@ -99,10 +99,12 @@ static std::string alarm_words(const snapshot_alarm &alarm, const std::vector<re
         {"adjacency", "a router is not connected as it should be"},
         {"assignment", "a router does not share out the traffic as asked"},
     };
-    std::string text = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": " : alarm.source + ": ";
     const auto *row = std::find_if(std::begin(known), std::end(known),
                                    [&](const auto &each) { return alarm.name == each.name; });
-    const reason *cause = alarm_reason(reasons, alarm.group, alarm.name);
+    const reason *cause = alarm_reason(reasons, alarm.group, alarm.name, alarm.source);
+    std::string text = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": " : alarm.source + ": ";
+    if (cause && alarm.group < 0)
+        text.clear(); // the cause names its subject
     text += cause ? cause->cause : row != std::end(known) ? row->words : alarm.text;
     return alarm.since.empty() ? text : text + ", since " + alarm.since;
 }

@@ -110,6 +110,7 @@ int main(int argc, char **argv) {
     daemon.facility_file = LC_LOG_FACILITY_FILE;
     daemon.now_ms = lt_monotonic_ms;
     daemon.say = say;
+    daemon.supervises = supervise;
 
     const int signals = block_signals();
     transport sockets;
@@ -127,6 +128,9 @@ int main(int argc, char **argv) {
     processes.say = say;
     processes.tell = [&](const std::string &event, const std::string &process) {
         server_process_event(&daemon, event, process);
+    };
+    processes.restarted = [&](const std::string &process, const std::string &last_end) {
+        server_note_restart(&daemon, process, last_end);
     };
     processes.children = {{"tunneld", command_words(supervise ? tunneld : "")},
                           {"wccpd", command_words(supervise ? wccpd : "")}};

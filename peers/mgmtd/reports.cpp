@@ -7,8 +7,9 @@
 //   /qv/alarms/state/drain/GROUP                 draining, drained, over (drains.cpp)
 //
 // TYPE is the number of the alarm, SOURCE says what it is about. A report that comes again replaces the one
-// before. Alarms are not resent by whoever raised them, so those of a session that ends are taken as
-// cleared: a daemon that is gone watches nothing. Each report is passed on to those with an interest in it.
+// before. Nobody resends an alarm or a role. Those of a session that ends are therefore forgotten, because a
+// daemon that is gone watches nothing: the alarm counts as cleared, the role as UNKNOWN. Each report is
+// passed on to those with an interest in it, and so is each that is forgotten.
 #include <ctime>
 
 #include "mgmt/node_paths.h"
@@ -19,6 +20,7 @@
 // Of what a report says, as much is kept as a person reads; with ALARMS_MAX of them a walk still fits in one
 // message.
 static constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
+static constexpr uint32_t OWN_REPORTS = 0; // instead of a session: those of mgmtd itself
 
 node_value server_time_now() {
     owned_text text;
@@ -54,7 +56,8 @@ static node_name alarm_root(const std::vector<event_field> &fields) {
         .below(text_or(fields, "param_3", "-"));
 }
 
-static void take_raise(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+static void keep_alarm(server *self, uint32_t peer_id, const std::string &reporter,
+                       const std::vector<event_field> &fields) {
     const node_name root = alarm_root(fields);
     if (!keep_report(self, peer_id, root)) {
         self->say("alarm lost, too many are active: " + root.text());
@@ -64,8 +67,12 @@ static void take_raise(server *self, uint32_t peer_id, const std::vector<event_f
     self->state[root] = {bn_type_str, comment};
     self->state[root.below("name")] = {bn_type_str, alarm_name(root.parts[root.parts.size() - 2])};
     self->state[root.below("since")] = server_time_now();
-    self->state[root.below("reporter")] = {bn_type_str, self->peers[peer_id].name};
+    self->state[root.below("reporter")] = {bn_type_str, reporter};
     self->say("alarm raised: " + root.parts.back() + " " + comment);
+}
+
+static void take_raise(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+    keep_alarm(self, peer_id, self->peers[peer_id].name, fields);
 }
 
 static void take_clear(server *self, uint32_t, const std::vector<event_field> &fields) {
@@ -115,6 +122,37 @@ void server_take_event(server *self, uint32_t peer_id, const std::string &event,
     self->say("event of " + self->peers[peer_id].name + " passed over: " + event);
 }
 
+void server_raise_own_alarm(server *self, const std::vector<event_field> &fields, bool is_news) {
+    if (!is_news) {
+        self->state[alarm_root(fields)] = {bn_type_str, text_or(fields, "comment", "", TEXT_MAX)};
+        return;
+    }
+    keep_alarm(self, OWN_REPORTS, "mgmtd", fields);
+    server_send_event(self, EVENT_RAISE_ALARM, fields);
+}
+
+void server_clear_own_alarm(server *self, const std::vector<event_field> &fields) {
+    take_clear(self, OWN_REPORTS, fields);
+    server_send_event(self, EVENT_CLEAR_ALARM, fields);
+}
+
+// What watchers get instead of the report that a daemon which is gone cannot send.
+static void report_forgotten(server *self, const node_name &root) {
+    const std::string &last = root.parts.back();
+    if (root.is_under(parsed_name(NODE_ROLES)))
+        server_send_event(self, EVENT_ROLE_CHANGE,
+                          {{"group", {bn_type_str, last}},
+                           {"role", {bn_type_uint32, "2"}},
+                           {"code", {bn_type_uint32, "0"}}});
+    else
+        server_send_event(self, EVENT_CLEAR_ALARM,
+                          {{"alarm_type", {bn_type_str, root.parts[root.parts.size() - 2]}},
+                           {"param_1", {bn_type_str, "0"}},
+                           {"param_2", {bn_type_str, "0"}},
+                           {"param_3", {bn_type_str, last}},
+                           {"comment", {bn_type_str, "forgotten with the session of its reporter"}}});
+}
+
 void server_forget_reports(server *self, uint32_t peer_id) {
     std::vector<node_name> gone;
     for (const auto &[root, owner] : self->alarm_owners)
@@ -123,5 +161,6 @@ void server_forget_reports(server *self, uint32_t peer_id) {
     for (const node_name &root : gone) {
         server_remove_report(self, root);
         self->say("forgotten with its session: " + root.text());
+        report_forgotten(self, root);
     }
 }

@@ -354,6 +354,7 @@ int64_t server_tick(server *self) {
     take_earlier(&next, server_return_unconfirmed(self));
     take_earlier(&next, server_end_drains(self));
     take_earlier(&next, server_expire_bypasses(self));
+    take_earlier(&next, server_clear_restart_alarms(self));
     for (const auto &[id, query] : self->pending) // also those that have gone on to another daemon
         take_earlier(&next, query.deadline_ms);
     return next;

@@ -3,6 +3,7 @@
 
 #include <cstdint>
 #include <ctime>
+#include <deque>
 #include <functional>
 #include <map>
 #include <memory>
@@ -90,6 +91,15 @@ struct drain_request {
     bool left = false;
     int64_t flows = -1; // that the proxy still has, by tunneld's last report; -1 unknown
 };
+// A daemon that is restarted this often within this time raises an alarm.
+constexpr size_t RESTARTS_MAX = 3;
+constexpr int64_t RESTARTS_WITHIN_MS = 300000;
+constexpr size_t RESTARTS_KEPT = 100; // the times of a daemon's last restarts
+struct restart_watch {
+    std::deque<int64_t> at_ms;     // within RESTARTS_WITHIN_MS of the last one
+    int64_t running_since_ms = -1; // it has a session since; -1: it has none
+    bool alarm = false;            // is active
+};
 // What wccpd is given instead of what is configured.
 struct group_overlay {
     bool down = false;
@@ -135,6 +145,8 @@ struct server {
     std::map<uint8_t, left_group> left;
     std::map<uint8_t, slowed_group> slowed;
     std::map<uint8_t, drain_request> drains;
+    std::map<std::string, restart_watch> restarts; // by the daemon's name
+    bool supervises = false;                       // restarts are reported by the supervisor
     int64_t expire_at_ms = 0; // when bypass entries are looked at again; -1: not before a commit
 };
 
@@ -173,12 +185,19 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,
                        const std::vector<event_field> &fields);
 void server_forget_reports(server *self, uint32_t peer_id);
+// An alarm of mgmtd itself, with the fields of EVENT_RAISE_ALARM. `is_news`: it was not active before, and is
+// reported; otherwise only its text is replaced.
+void server_raise_own_alarm(server *self, const std::vector<event_field> &fields, bool is_news);
+void server_clear_own_alarm(server *self, const std::vector<event_field> &fields);
 node_value server_time_now();
 // Takes a node of `state` out, with those below it.
 void server_remove_report(server *self, const node_name &root);
 
-// A session has opened or closed: what it says of its daemon, in processes.cpp.
+// The daemons' processes, in processes.cpp. A session has opened or closed:
 void server_note_process(server *self, const std::string &session);
+// The process has been started again; `last_end` says how it had ended ("exited with 1"), or is empty.
+void server_note_restart(server *self, const std::string &process, const std::string &last_end);
+int64_t server_clear_restart_alarms(server *self); // the time of the next look, or -1
 
 // Groups that are out of their routers, in left_groups.cpp.
 void server_take_leave(server *self, uint32_t peer_id, const std::vector<event_field> &fields);

@@ -138,6 +138,8 @@ static void start(supervisor *self, child *process) {
     process->kill_at_ms = -1;
     process->has_session = false;
     self->say("process " + process->name + ": started, pid " + std::to_string(process->pid));
+    if (self->restarted && !process->last_end.empty())
+        self->restarted(process->name, process->last_end);
 }
 
 void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout) {
@@ -163,29 +165,10 @@ static bool is_orderly(int wait_status) {
     return WIFSIGNALED(wait_status) ? WTERMSIG(wait_status) == SIGTERM : WEXITSTATUS(wait_status) == 0;
 }
 
-// A child that is replaced in time is not reported as lost, however often it crashes.
-static void count_crash(supervisor *self, child *process, int64_t now) {
-    if (process->crashes == 0 || now - process->crashes_since_ms >= 2 * CRASHES_EVERY_MS) {
-        process->crashes = 0;
-        process->crashes_since_ms = now;
-    }
-    process->crashes++;
-    const int64_t period = now - process->crashes_since_ms;
-    if (period < CRASHES_EVERY_MS)
-        return;
-    const std::string text = "process " + process->name + ": crashed " + std::to_string(process->crashes) +
-                             " times in " + std::to_string(period / 1000) + " s";
-    process->crashes = 1;
-    process->crashes_since_ms = now;
-    self->say(text);
-    LC_LOG(LC_LOG_WARNING, "%s", text.c_str());
-}
-
 static void take_end(supervisor *self, child *process, int status) {
     const int64_t now = self->now_ms(), ran = now - process->started_ms;
     const bool may_be_replaced = process->takes_over && !self->ending && !is_orderly(status);
-    if (may_be_replaced)
-        count_crash(self, process, now);
+    process->last_end = end_text(status);
     if (may_be_replaced && process->has_session && !process->loss)
         process->loss = {end_event(status, false), end_text(status), now};
     process->delay_ms =

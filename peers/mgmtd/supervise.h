@@ -21,7 +21,6 @@ constexpr int64_t END_PATIENCE_MS = 10000;
 constexpr int64_t TAKE_OVER_MS = 3000;
 constexpr int64_t EARLIER_RUN_EVERY_MS = 200; // to the next look at a run that has to end first
 constexpr int64_t SHORT_RUN_MS = 500;         // a run that has ended sooner is not started again at once
-constexpr int64_t CRASHES_EVERY_MS = 60000;   // between two warnings that a child keeps crashing
 
 struct process_loss { // of a run whose next one may take over
     const char *event;
@@ -41,8 +40,7 @@ struct child {
     int sessions = 0;          // that are open
     bool end_reported = false; // by the process itself, whose sessions are about to close
     std::optional<process_loss> loss = {};
-    uint32_t crashes = 0; // since `crashes_since_ms`, the first of them included
-    int64_t crashes_since_ms = 0;
+    std::string last_end = {}; // "ended by SIGKILL"; "" before the first end
     // A file that each run holds locked, or "". The run of a mgmtd that was killed may not have ended yet,
     // and two at a time get into each other's way.
     std::string lock_file = {};
@@ -54,6 +52,8 @@ struct supervisor {
     std::function<int64_t()> now_ms;
     std::function<void(const std::string &line)> say;
     std::function<void(const std::string &event, const std::string &process)> tell;
+    // A child has been started again after this end; null: nobody counts.
+    std::function<void(const std::string &process, const std::string &last_end)> restarted;
     bool ending = false;
 };
 

@@ -499,7 +499,8 @@ const char *alarm_name(const std::string &type) {
         const char *name;
     } alarms[] = {{ALARM_TYPE_ADJACENCY, "adjacency"},
                   {ALARM_TYPE_ASSIGNMENT, "assignment"},
-                  {ALARM_TYPE_OVERLOAD, "overload"}};
+                  {ALARM_TYPE_OVERLOAD, "overload"},
+                  {ALARM_TYPE_RESTARTS, "restart-loop"}};
     for (const auto &alarm : alarms)
         if (type == std::to_string(alarm.type))
             return alarm.name;
