@@ -1,7 +1,8 @@
 #!/bin/bash
 # The Debian package on a system of its own: it is built, checked by lintian and installed under a systemd in namespaces.
-# The three programs run with few privileges, and a group becomes active. Programs that are killed or hang are restarted,
-# an upgrade and a reboot keep the configuration, and a purge leaves nothing.
+# The three programs run with few privileges, a group becomes active, and nobody's command is notified of it. Programs that
+# are killed or hang are restarted, with an alarm when that happens too often. An upgrade and a reboot keep the
+# configuration, and a purge leaves nothing.
 #   scenario_package.sh [DIRECTORY_OF_THE_PROGRAMS]    of wccp_router
 #
 #   WCCP_PACKAGE    a directory with a package that has been built already
@@ -126,7 +127,15 @@ ctl intercept add 51 port 80 to 3129 leave 0 || die "no intercept"
 wait_active 30
 ctl show | grep -q '^51 *ACTIVE' || die "$(ctl show)"
 
-for unit in "${services[@]}"; do
+# Not started by the package; its commands have the rights of nobody.
+[ "$(inside systemctl is-enabled wccp-notify)" = disabled ] && ! is_up wccp-notify || die "notifications are enabled"
+notified=$here/root/var/lib/wccp-notify/notified
+printf '#!/bin/sh\necho "$(id -un) $WCCP_KIND $WCCP_GROUP $WCCP_STATE $WCCP_ALARM" >>/var/lib/wccp-notify/notified\n' >$here/root/etc/wccpd/notify.d/record
+chmod 755 $here/root/etc/wccpd/notify.d/record
+inside systemctl enable --now wccp-notify >/dev/null 2>&1 && until_true 10 grep -qx 'wccp-notify role 51 ACTIVE ' "$notified" ||
+    die "no notification: $(cat "$notified"; inside journalctl -qu wccp-notify)"
+
+for unit in "${services[@]}" wccp-notify; do
     inside systemd-analyze security --no-pager "$unit" >$here/security 2>&1
     level=$(sed -n 's/.*exposure level for .*: \([0-9.]*\) .*/\1/p' $here/security)
     echo "$unit: exposure $level"
@@ -149,6 +158,14 @@ for unit in wccpd mgmtd; do
     wait_restarted 20 $unit "$old"
 done
 until_true 20 is_up wccpd || die "wccpd is not up with the new mgmtd"
+for time in 1 2 3; do
+    old=$(main_pid wccpd)
+    inside systemctl kill -s KILL wccpd
+    wait_restarted 20 wccpd "$old"
+    until_true 20 eval 'ctl get /qv/alarms/state/process/wccpd | grep -q running'
+done
+ctl alarms | grep -q 'restart-loop.*wccpd ends again and again: restarted [3-9] times' || die "no alarm: $(ctl alarms)"
+until_true 10 grep -qx 'wccp-notify alarm  raised restart-loop' "$notified" || die "not notified: $(cat "$notified")"
 for unit in "${services[@]}"; do
     mkdir -p $here/root/etc/systemd/system/$unit.service.d
     printf '[Service]\nWatchdogSec=3\n' >$here/root/etc/systemd/system/$unit.service.d/quick.conf
@@ -192,7 +209,7 @@ inside systemctl start wccp.target && until_true 20 is_up "${services[@]}" || di
 
 inside dpkg --purge wccpd >$here/dpkg.log 2>&1 || { cat $here/dpkg.log; die "dpkg"; }
 ! inside ps -A -o comm= | grep -qxE 'wccpd|tunneld|mgmtd' || die "programs are left running"
-left=$(cd $here/root && ls -d etc/wccpd etc/opt/rvl var/opt/rvl run/tunneld run/wccpd.pid run/mgmtd.lock usr/sbin/wccpd \
+left=$(cd $here/root && ls -d etc/wccpd var/lib/wccp-notify etc/opt/rvl var/opt/rvl run/tunneld run/wccpd.pid run/mgmtd.lock usr/sbin/wccpd \
     etc/systemd/system/*.wants/{wccp,mgmtd,tunneld}* tmp/gcl-socks/* 2>/dev/null
     inside sh -c 'cd /; ls -d /run/tunneld /run/wccpd.pid /run/mgmtd.lock /tmp/gcl-socks/* 2>/dev/null; ip -o link show group 2048')
 [ -z "$left" ] || die "left after the purge: $left"

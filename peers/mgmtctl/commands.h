@@ -84,5 +84,13 @@ int ctl_explain(const ctl_options &options, int group);
 int ctl_list_reasons(const ctl_options &options); // all that there can be
 // What bites on this host, with or without mgmtd (check.cpp). 0: nothing to fix, 1: something.
 int ctl_check(const ctl_options &options);
+// Commands that are run at each change of a role, an alarm or a proxy's health (notify.cpp): "run" or "list".
+struct ctl_notify_options {
+    std::string directory = "/etc/wccpd/notify.d";
+    std::string state_file = "/var/lib/wccp-notify/reported"; // states that commands have been run for
+    std::string user;                                         // that root becomes
+    uint32_t limit_s = 30;                                    // for a command
+};
+int ctl_notify(const ctl_options &options, const std::string &word, const ctl_notify_options &how);
 // Events as they come (watch.cpp). `count` 0: until a signal ends the program.
 int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count);

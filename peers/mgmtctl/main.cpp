@@ -110,6 +110,7 @@ struct command_line {
     uint64_t count = 0;
     ctl_apply_options apply;
     uint32_t from = 0, to = 0; // commits
+    ctl_notify_options notify;
 };
 } // namespace
 
@@ -273,6 +274,20 @@ static void add_metrics_command(command_line *line) {
     command->add_flag("--http", line->http, "answer the HTTP request on standard input");
 }
 
+static void add_notify_command(command_line *line) {
+    CLI::App *command =
+        add_command(line, "notify", "commands at changes of roles, alarms and proxies: run, list",
+                    [line] { return ctl_notify(line->options, line->name, line->notify); });
+    command->add_option("WORD", line->name)->required();
+    command->add_option("--directory", line->notify.directory, "of the commands")->capture_default_str();
+    command->add_option("--state", line->notify.state_file, "the file of the states that were reported")
+        ->capture_default_str();
+    command->add_option("--user", line->notify.user, "whose rights the commands have, when root starts it");
+    command->add_option("--limit", line->notify.limit_s, "seconds that a command may take")
+        ->check(CLI::Range(1u, 3600u))
+        ->capture_default_str();
+}
+
 static void add_shell_command(command_line *line) {
     CLI::App *command = add_command(
         line, "complete", "", [line] { return ctl_complete(line->words.empty() ? "" : line->words[0]); });
@@ -299,6 +314,7 @@ int main(int argc, char **argv) {
     add_explain_command(&line);
     add_check_command(&line);
     add_metrics_command(&line);
+    add_notify_command(&line);
     add_shell_command(&line);
 
     take_signals();

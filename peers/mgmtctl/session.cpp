@@ -103,8 +103,9 @@ struct blocked_signals {
 enum class round { ran, over, interrupted };
 } // namespace
 
-// One poll until `deadline` (-1: no limit), and what is ready called.
-static round run_round(ctl_session *self, int64_t deadline) {
+// One poll until `deadline` (-1: no limit), and what is ready called. It is over as well when `other_fd` can
+// be read.
+static round run_round(ctl_session *self, int64_t deadline, int other_fd = -1) {
     const blocked_signals blocked;
     if (ctl_stop_signal)
         return round::interrupted;
@@ -118,15 +119,17 @@ static round run_round(ctl_session *self, int64_t deadline) {
         polled[i].events =
             static_cast<short>((event->want_read ? POLLIN : 0) | (event->want_write ? POLLOUT : 0));
     }
+    polled.push_back({other_fd, POLLIN, 0});
     const int64_t left = deadline < 0 ? 0 : std::max<int64_t>(deadline - lt_monotonic_ms(), 0);
     const timespec limit = {static_cast<time_t>(left / 1000), static_cast<long>(left % 1000 * 1000000)};
     const int ready = ppoll(polled.data(), polled.size(), deadline < 0 ? nullptr : &limit, &blocked.before);
     if (ready < 0)
         return errno == EINTR ? round::interrupted : round::over;
-    if (ready == 0)
-        return round::over;
-    call_ready(events.pointer, polled);
-    return round::ran;
+    const bool other_ready = polled.back().revents != 0;
+    polled.pop_back();
+    if (ready > 0)
+        call_ready(events.pointer, polled);
+    return ready == 0 || other_ready ? round::over : round::ran;
 }
 
 // Until `done`, in the time that requests have.
@@ -352,14 +355,15 @@ bool ctl_add_interest(ctl_session *session, const std::string &event,
     return reply.code == 0 || fail(out_reason, reply.message);
 }
 
-int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason) {
+int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason,
+                   int other_fd) {
     const int64_t deadline = wait_ms < 0 ? -1 : lt_monotonic_ms() + wait_ms;
     while (session->events.empty()) {
         if (!is_connected(session)) {
             fail(out_reason, "mgmtd closed the session");
             return -1;
         }
-        if (run_round(session, deadline) != round::ran && session->events.empty())
+        if (run_round(session, deadline, other_fd) != round::ran && session->events.empty())
             return 0;
     }
     *out = std::move(session->events.front());

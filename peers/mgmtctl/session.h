@@ -65,5 +65,7 @@ bool ctl_action(ctl_session *session, const std::string &name, const std::vector
 bool ctl_add_interest(ctl_session *session, const std::string &event,
                       const std::vector<std::string> &patterns, std::string *out_reason);
 // Waits for the next event, also one that came during a request. 1: it is here; 0: none within `wait_ms` (-1:
-// no limit); -1: the session has ended, with the reason. A signal that a handler takes ends the wait with 0.
-int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason);
+// no limit); -1: the session has ended, with the reason. A signal that a handler takes ends the wait with 0,
+// and so does `other_fd` (-1: none) when it can be read.
+int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason,
+                   int other_fd = -1);

@@ -1,0 +1,254 @@
+// "mgmtctl notify": which changes are reported and in which order, what commands get to know, and how they
+// are run.
+#include <csignal>
+#include <fstream>
+#include <sstream>
+
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "mgmt/node_paths.h"
+#include "peers/mgmtctl/notify_command.h"
+#include "peers/mgmtctl/notify_words.h"
+#include "runtime/ttime.h"
+
+namespace {
+
+using strings = std::vector<std::string>;
+constexpr notify_kind ROLE = notify_kind::role, ALARM = notify_kind::alarm, HEALTH = notify_kind::health;
+
+struct Notify : testing::Test {
+    notify_book book;
+    std::string said;
+
+    void SetUp() override {
+        book.say = [this](const std::string &line) { said += line + "\n"; };
+        book.clock_s = [] { return int64_t{1000}; };
+    }
+    // What is reported next, as "kind name previous>state merged".
+    strings take_all() {
+        strings out;
+        for (notify_change change; notify_take(&book, &change);)
+            out.push_back(std::string(notify_kind_word(change.subject.kind)) + " " + change.subject.name +
+                          " " + change.previous + ">" + change.state + " " + std::to_string(change.merged));
+        return out;
+    }
+};
+
+TEST_F(Notify, ChangesComeInTheirOrderAndANewerStateReplacesOneThatWaits) {
+    const auto note = [&](notify_kind kind, const char *name, const char *state) {
+        notify_note(&book, {kind, name}, state, "");
+    };
+    note(ROLE, "51", "BACKUP");
+    note(HEALTH, "51", "up");
+    note(ALARM, "196638 eth0:grp:51", "raised");
+    note(ROLE, "51", "ACTIVE");
+    note(ROLE, "51", "ACTIVE");
+    note(ALARM, "196638 eth0:grp:52", "cleared"); // was never raised
+    EXPECT_EQ(take_all(), (strings{"role 51 UNKNOWN>ACTIVE 1", "health 51 unknown>up 0",
+                                   "alarm 196638 eth0:grp:51 cleared>raised 0"}));
+    EXPECT_EQ(said, "role 51: BACKUP was replaced by ACTIVE before its turn (1 replaced so far)\n");
+    // A proxy whose health is not known has the last one; a state that was left and came back is reported.
+    note(HEALTH, "51", "unknown");
+    note(HEALTH, "51", "up");
+    note(ROLE, "51", "BACKUP");
+    note(ROLE, "51", "ACTIVE");
+    EXPECT_EQ(take_all(), (strings{"role 51 ACTIVE>ACTIVE 1"}));
+
+    said.clear();
+    for (size_t i = 0; i <= NOTIFY_WAITING_MAX; i++)
+        note(ALARM, ("7 " + std::to_string(i)).c_str(), "raised");
+    EXPECT_EQ(book.waiting.size(), NOTIFY_WAITING_MAX);
+    EXPECT_EQ(said,
+              "alarm 7 256: raised is dropped until there is room, 256 changes wait (1 dropped so far)\n");
+}
+
+// What nobody saw is found, also by the next process.
+TEST_F(Notify, AComparisonFindsWhatWasMissed) {
+    notify_compare(&book, ROLE, {{"51", {"ACTIVE", ""}}, {"52", {"BACKUP", ""}}});
+    notify_compare(&book, ALARM, {{"196640 proxy:grp:5 1", {"raised", ""}}});
+    notify_compare(&book, HEALTH, {{"51", {"up", ""}}, {"52", {"down", ""}}});
+    EXPECT_EQ(take_all().size(), 5u);
+    const std::string text = notify_book_text(book);
+    EXPECT_EQ(text, "ACTIVE role 51\nBACKUP role 52\nraised alarm 196640 proxy:grp:5 1\nup health 51\ndown "
+                    "health 52\n");
+    book.reported.clear();
+    EXPECT_EQ(notify_read_book(&book, text + "AKTIVE role 5\nACTIVE role\nUNK role 5\nup role 5\n\x01\n\n"),
+              6u);
+    EXPECT_EQ(notify_book_text(book), text);
+    notify_compare(&book, ROLE, {{"52", {"ACTIVE", ""}}});
+    notify_compare(&book, ALARM, {});
+    notify_compare(&book, HEALTH, {{"52", {"down", ""}}}); // the intercept of 51 is gone
+    EXPECT_EQ(take_all(), (strings{"role 52 BACKUP>ACTIVE 0", "role 51 ACTIVE>UNKNOWN 0",
+                                   "alarm 196640 proxy:grp:5 1 raised>cleared 0"}));
+    EXPECT_EQ(notify_book_text(book), "ACTIVE role 52\ndown health 52\n");
+}
+
+TEST_F(Notify, ACommandGetsTheChangeAndItsReason) {
+    reason silent, loop, absent;
+    silent.code = "router-silent";
+    silent.group = 51;
+    silent.who = "10.0.0.1";
+    loop.code = "restart-loop";
+    loop.who = "tunneld";
+    loop.offered = "restarted 3 times in 9 s";
+    absent.code = "wccpd-absent";
+    for (reason *each : {&silent, &loop, &absent})
+        fill_reason(reason_texts(), each);
+    const auto told = [](const ctl_event &event, const std::vector<reason> &reasons) {
+        notify_change change = {{}, "", "before", "", 1000, 2};
+        notify_state state;
+        EXPECT_TRUE(read_notify_event(event, &change.subject, &state));
+        change.state = state.state;
+        change.detail = state.detail;
+        std::string out;
+        for (const std::string &each : notify_environment(change, reasons))
+            if (!each.starts_with("WCCP_TIME="))
+                out += each.substr(5) + "|";
+        return out;
+    };
+    const auto alarm = [](const char *event, const char *type, const std::string &source) {
+        return ctl_event{
+            event,
+            {{"alarm_type", "string", type}, {"param_3", "string", source}, {"comment", "string", "words"}}};
+    };
+    EXPECT_EQ(
+        told({EVENT_ROLE_CHANGE, {{"group", "string", "51"}, {"role", "uint32", "1"}}}, {silent}),
+        "KIND=role|GROUP=51|ALARM=|SOURCE=|STATE=BACKUP|PREVIOUS=before|REASON=router-silent|CAUSE=10.0.0.1 "
+        "has stopped answering: no I-See-You for 40 s|NEXT=check the router and the path to it|MERGED=2|");
+    EXPECT_EQ(
+        told({EVENT_ROLE_CHANGE, {{"group", "string", "51"}, {"role", "uint32", "2"}}}, {absent, silent})
+            .find("REASON=wccpd-absent|"),
+        told({EVENT_ROLE_CHANGE, {{"group", "string", "51"}, {"role", "uint32", "2"}}}, {absent})
+            .find("REASON="));
+    EXPECT_EQ(told({EVENT_PROXY_CHANGE,
+                    {{"group", "uint8", "7"},
+                     {"up", "bool", "false"},
+                     {"reason", "string", "no\nanswer\x1b[1m" + std::string(999, 'x')}}},
+                   {}),
+              "KIND=health|GROUP=7|ALARM=|SOURCE=|STATE=down|PREVIOUS=before|REASON=proxy-down|CAUSE=no?"
+              "answer?[1m" +
+                  std::string(242, 'x') + "|NEXT=start the proxy: mgmtctl intercept show 7|MERGED=2|");
+    EXPECT_EQ(told(alarm(EVENT_RAISE_ALARM, "196641", "tunneld"), {loop}),
+              "KIND=alarm|GROUP=|ALARM=restart-loop|SOURCE=tunneld|STATE=raised|PREVIOUS=before|REASON="
+              "restart-loop|"
+              "CAUSE=tunneld ends again and again: restarted 3 times in 9 s|NEXT=" +
+                  loop.next + "|MERGED=2|");
+    EXPECT_EQ(told(alarm(EVENT_CLEAR_ALARM, "196638", "eth0:grp:51"), {silent}),
+              "KIND=alarm|GROUP=51|ALARM=adjacency|SOURCE=eth0:grp:51|STATE=cleared|PREVIOUS=before|REASON=|"
+              "CAUSE=words|"
+              "NEXT=|MERGED=2|");
+    notify_subject subject;
+    notify_state state;
+    EXPECT_FALSE(read_notify_event({EVENT_ROLE_CHANGE, {{"group", "string", "256"}}}, &subject, &state));
+    EXPECT_FALSE(read_notify_event({EVENT_PROCESS_CRASH, {}}, &subject, &state));
+}
+
+struct Commands : testing::Test {
+    char directory[32] = "/tmp/notify-test-XXXXXX";
+    std::string said;
+
+    void SetUp() override {
+        sigset_t set;
+        sigemptyset(&set);
+        for (const int number : {SIGCHLD, SIGTERM, SIGINT, SIGHUP})
+            sigaddset(&set, number);
+        sigprocmask(SIG_BLOCK, &set, nullptr);
+        ASSERT_TRUE(mkdtemp(directory));
+    }
+    void TearDown() override { (void)!system(("rm -rf " + std::string(directory)).c_str()); }
+    std::string add(const char *name, const std::string &script, mode_t mode = 0755) {
+        const std::string path = std::string(directory) + "/" + name;
+        std::ofstream(path) << "#!/bin/sh\ncd " << directory << "\n" << script;
+        chmod(path.c_str(), mode);
+        return path;
+    }
+    std::string read(const char *name) {
+        std::ostringstream out;
+        out << std::ifstream(std::string(directory) + "/" + name).rdbuf();
+        return out.str();
+    }
+    notify_run run(int64_t limit_ms) {
+        return {find_notify_commands(directory).paths,
+                {"WCCP_KIND=role"},
+                limit_ms,
+                300,
+                [this](const std::string &line) { said += line + "\n"; }};
+    }
+};
+
+TEST_F(Commands, RunOneAfterTheOtherWithAllThatTheyStart) {
+    setenv("WCCP_STALE", "1", 1);
+    setenv("OPERATOR", "yes", 1);
+    add("10-first", "echo first >>log; (sleep 0.3; echo late >>log) & exit 3\n");
+    add("20-second", "echo second $WCCP_KIND $WCCP_STALE $OPERATOR >>log; read x || echo no input >>log; ls "
+                     "/proc/self/fd | wc -l >>log\n");
+    EXPECT_EQ(run_notify_commands(run(10000)), NOTIFY_FAILED);
+    EXPECT_EQ(read("log"), "first\nlate\nsecond role yes\nno input\n4\n"); // 4: that of ls itself
+    EXPECT_EQ(said, std::string(directory) + "/10-first: exited with 3\n");
+}
+
+TEST_F(Commands, EndWithTheirWholeGroupWhenTheyTakeTooLong) {
+    const auto alive = [&](const char *name) { return kill(std::stoi(read(name)), 0) == 0; };
+    add("10-slow", "sleep 100 & echo $! >slow; wait\n");
+    add("20-stubborn", "trap '' TERM; sleep 100 & echo $! >stubborn; wait; wait\n");
+    add("30-next", "echo next >next\n");
+    const int64_t began = lt_monotonic_ms();
+    EXPECT_EQ(run_notify_commands(run(400)), NOTIFY_TIMED_OUT);
+    EXPECT_LT(lt_monotonic_ms() - began, 8000);
+    EXPECT_FALSE(alive("slow"));
+    EXPECT_FALSE(alive("stubborn"));
+    EXPECT_EQ(read("next"), "next\n");
+    EXPECT_NE(said.find("/20-stubborn: not done after 0 s, ended\n"), std::string::npos) << said;
+
+    // The end of the program ends the command that runs, and no other is started.
+    unlink((std::string(directory) + "/next").c_str());
+    unlink((std::string(directory) + "/slow").c_str());
+    pid_t pid = 0;
+    int pidfd = -1, status = 0;
+    ASSERT_TRUE(start_notify_commands(run(60000), &pid, &pidfd));
+    while (read("slow").empty())
+        usleep(10000);
+    kill(pid, SIGTERM);
+    pollfd ended = {pidfd, POLLIN, 0};
+    EXPECT_EQ(poll(&ended, 1, 8000), 1);
+    ASSERT_EQ(waitpid(pid, &status, 0), pid);
+    EXPECT_NE(WEXITSTATUS(status), NOTIFY_DONE);
+    EXPECT_FALSE(alive("slow"));
+    EXPECT_EQ(read("next"), "");
+    close(pidfd);
+}
+
+TEST_F(Commands, OnlyWhatRootAloneCanHaveWrittenIsRun) {
+    const std::string good = add("good", "true\n");
+    add("group-writable", "true\n", 0775);
+    add("plain", "true\n", 0644);
+    add("with.dot", "true\n");
+    ASSERT_EQ(symlink("good", (std::string(directory) + "/link").c_str()), 0);
+    const notify_commands found = find_notify_commands(directory);
+    // The group is root's own.
+    EXPECT_EQ(found.paths, (strings{good, std::string(directory) + "/group-writable"}));
+    ASSERT_EQ(found.refused.size(), 3u);
+    for (const auto &[name, why] :
+         {std::pair("link", "not a regular file"), {"plain", "not executable"}, {"with.dot", "letters"}})
+        EXPECT_TRUE(std::any_of(found.refused.begin(), found.refused.end(),
+                                [&, n = name, w = why](const std::string &line) {
+                                    return line.find(n) != std::string::npos &&
+                                           line.find(w) != std::string::npos;
+                                }))
+            << name;
+    chmod(good.c_str(), 0757);
+    EXPECT_EQ(find_notify_commands(directory).paths.size(), 1u);
+    if (chown(good.c_str(), 65534, 65534) == 0) {
+        chmod(good.c_str(), 0755);
+        EXPECT_EQ(find_notify_commands(directory).paths.size(), 1u);
+    }
+    chmod(directory, 0777);
+    EXPECT_TRUE(find_notify_commands(directory).paths.empty());
+    EXPECT_TRUE(find_notify_commands("/no/such/directory").refused.empty());
+}
+
+} // namespace
