@@ -4,26 +4,28 @@
 
 #include "mgmt/node_paths.h"
 
+namespace {
+
 // The root of the service group that the node belongs to, or the node itself.
-static node_name unit_of(const node_name &name) {
+node_name find_unit(const node_name &name) {
     static const node_name groups = parsed_name(NODE_GROUP_CONFIG);
     if (!name.is_under(groups))
         return name;
     return groups.below(name.parts[groups.parts.size()]);
 }
 
-static bool is_group(const node_name &name) {
+bool is_group(const node_name &name) {
     static const node_name pattern = parsed_name(NODE_GROUP_CONFIG "/*");
     return matches(pattern, name);
 }
 
 // A change of a group that exists before and after.
-static bool can_follow(const node_change &change) {
+bool can_follow(const node_change &change) {
     const schema_row *row = find_schema_row(change.name);
     return change.after && row && !row->recreates;
 }
 
-static void append_group(const node_map &nodes, const node_name &root, bool created, change_list *out) {
+void append_group(const node_map &nodes, const node_name &root, bool created, change_list *out) {
     node_list found;
     collect_nodes(nodes, root, {true, true, false}, &found);
     for (const auto *node : found) {
@@ -33,13 +35,15 @@ static void append_group(const node_map &nodes, const node_name &root, bool crea
     }
 }
 
+} // namespace
+
 wccpd_plan plan_for_wccpd(const node_tree &before, const node_tree &after, const commit_result &commit) {
     std::set<node_name> whole; // groups that are deleted, created, or both
     for (const node_name &name : commit.renewed)
         if (is_group(name))
             whole.insert(name);
     for (const node_change &change : commit.changes)
-        if (const node_name unit = unit_of(change.name); is_group(unit))
+        if (const node_name unit = find_unit(change.name); is_group(unit))
             if (change.name == unit || !can_follow(change))
                 whole.insert(unit);
     wccpd_plan plan;
@@ -50,16 +54,20 @@ wccpd_plan plan_for_wccpd(const node_tree &before, const node_tree &after, const
             plan.recreated.push_back(root);
     }
     for (const node_change &change : commit.changes)
-        if (!whole.contains(unit_of(change.name)))
+        if (!whole.contains(find_unit(change.name)))
             plan.events[1].push_back(change);
     return plan;
 }
 
+namespace {
+
 // At least the bytes that the bindings of a change take: up to five, each with the entry's name.
-static size_t size_of(const node_change &change) {
+size_t estimate_event_bytes(const node_change &change) {
     return 1000 + change.name.text().size() + (change.before ? change.before->text.size() : 0) +
            (change.after ? change.after->text.size() : 0);
 }
+
+} // namespace
 
 std::vector<std::vector<const node_change *>>
 cut_into_events(const std::vector<const node_change *> &changes) {
@@ -67,13 +75,13 @@ cut_into_events(const std::vector<const node_change *> &changes) {
     size_t size = 0;
     node_name unit;
     for (const node_change *change : changes) {
-        const node_name next = unit_of(change->name);
+        const node_name next = find_unit(change->name);
         if (out.empty() || (size >= EVENT_BYTES && next != unit)) {
             out.emplace_back();
             size = 0;
         }
         unit = next;
-        size += size_of(*change);
+        size += estimate_event_bytes(*change);
         out.back().push_back(change);
     }
     return out;

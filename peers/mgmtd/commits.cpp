@@ -19,7 +19,9 @@
 
 // --- Events
 
-static bool is_wanted(const peer &who, const node_name &name) {
+namespace {
+
+bool is_wanted(const peer &who, const node_name &name) {
     for (const interest &wish : who.interests) {
         if (wish.event != EVENT_CONFIG_CHANGE)
             continue;
@@ -33,7 +35,7 @@ static bool is_wanted(const peer &who, const node_name &name) {
 
 using event_changes = std::vector<const node_change *>;
 
-static std::vector<event_changes> events_for(const peer &who, std::span<const change_list> lists) {
+std::vector<event_changes> select_events(const peer &who, std::span<const change_list> lists) {
     std::vector<event_changes> out;
     for (const change_list &changes : lists) {
         event_changes wanted;
@@ -45,7 +47,7 @@ static std::vector<event_changes> events_for(const peer &who, std::span<const ch
     return out;
 }
 
-static bn_request_msg *make_event_for(const server *self, uint32_t peer_id, const event_changes &event) {
+bn_request_msg *make_event_for(const server *self, uint32_t peer_id, const event_changes &event) {
     const auto who = self->peers.find(peer_id);
     if (who == self->peers.end() || who->second.owner.may_change)
         return make_change_event(event);
@@ -62,7 +64,7 @@ static bn_request_msg *make_event_for(const server *self, uint32_t peer_id, cons
     return make_change_event(shown);
 }
 
-static void send_change_events(server *self, const node_tree &before, const commit_result &commit) {
+void send_change_events(server *self, const node_tree &before, const commit_result &commit) {
     wccpd_plan plan = plan_for_wccpd(before, self->tree, commit);
     for (change_list &changes : plan.events)
         server_adapt_for_wccpd(self, &changes);
@@ -71,7 +73,7 @@ static void send_change_events(server *self, const node_tree &before, const comm
     for (const auto &[id, who] : self->peers) {
         const bool runs_groups = server_runs_groups(who);
         for (event_changes &event :
-             events_for(who, runs_groups ? std::span(plan.events) : std::span(&commit.changes, 1))) {
+             select_events(who, runs_groups ? std::span(plan.events) : std::span(&commit.changes, 1))) {
             events.emplace_back(id, std::move(event));
             recreates = recreates || runs_groups;
         }
@@ -85,11 +87,13 @@ static void send_change_events(server *self, const node_tree &before, const comm
     }
 }
 
+} // namespace
+
 void server_send_to_wccpd(server *self, const change_list &changes) {
     std::vector<std::pair<uint32_t, event_changes>> events;
     for (const auto &[id, who] : self->peers)
         if (server_runs_groups(who))
-            for (event_changes &event : events_for(who, std::span(&changes, 1)))
+            for (event_changes &event : select_events(who, std::span(&changes, 1)))
                 events.emplace_back(id, std::move(event));
     for (const auto &[id, event] : events) {
         const owned_request msg(make_change_event(event));
@@ -99,18 +103,20 @@ void server_send_to_wccpd(server *self, const change_list &changes) {
 
 // --- The log facility
 
-static std::string facility_of(const node_tree &tree) {
+namespace {
+
+std::string read_facility(const node_tree &tree) {
     static const node_name facility = parsed_name(NODE_SYSTEM_FACILITY);
     const auto found = tree.nodes.find(facility);
     return found == tree.nodes.end() ? "" : found->second.text;
 }
 
 // Programs read the facility before they have a session. Other lines of the file are somebody else's.
-static void write_facility(const server *self) {
+void write_facility(const server *self) {
     if (self->facility_file.empty())
         return;
     std::optional<std::string> before;
-    std::string reason, content = "system " + facility_of(self->tree) + "\n";
+    std::string reason, content = "system " + read_facility(self->tree) + "\n";
     bool good = read_whole_file(self->facility_file, &before, &reason);
     std::istringstream lines(before.value_or(""));
     for (std::string line; std::getline(lines, line);)
@@ -127,11 +133,13 @@ static void write_facility(const server *self) {
                   reason);
 }
 
+} // namespace
+
 // --- Commits
 
 void server_take_over(server *self, node_tree next, const commit_result &commit) {
     const node_tree before = std::exchange(self->tree, std::move(next));
-    if (facility_of(before) != facility_of(self->tree))
+    if (read_facility(before) != read_facility(self->tree))
         write_facility(self);
     server_show_commits(self);
     send_change_events(self, before, commit);
@@ -140,52 +148,56 @@ void server_take_over(server *self, node_tree next, const commit_result &commit)
     self->expire_at_ms = 0;
 }
 
+namespace {
+
 // What mgmtd refuses beyond what a tree by itself shows.
-static bool may_commit(const server *self, const node_tree &next, std::string *out_reason) {
+bool check_commit(const server *self, const node_tree &next, std::string *out_reason) {
     const std::vector<std::string> bad = find_bad_routers(next, &self->tree, self->local_addresses());
     if (!bad.empty())
         *out_reason = bad.front();
     return bad.empty() && tree_check_change(self->tree, next, out_reason);
 }
 
-static commit_result refused(uint32_t code, const std::string &reason) {
+commit_result refuse_commit(uint32_t code, const std::string &reason) {
     return {code, reason, {}, {}};
 }
 
-static commit_result prepare_commit(server *self, const std::vector<set_step> &steps,
-                                    const commit_order &order, node_tree *out_next) {
+commit_result prepare_commit(server *self, const std::vector<set_step> &steps, const commit_order &order,
+                             node_tree *out_next) {
     if (order.revision && order.revision != self->tree.revision)
-        return refused(LC_ASSERTION, "The configuration has been changed since (commit " +
-                                         std::to_string(self->tree.revision) + "): look again");
+        return refuse_commit(LC_ASSERTION, "The configuration has been changed since (commit " +
+                                               std::to_string(self->tree.revision) + "): look again");
     commit_result result = tree_prepare(self->tree, steps, out_next);
     std::string reason;
     if (result.code != 0)
         return result;
-    if (!may_commit(self, *out_next, &reason))
-        return refused(LC_ASSERTION, reason);
+    if (!check_commit(self, *out_next, &reason))
+        return refuse_commit(LC_ASSERTION, reason);
     if (out_next->set == self->tree.set && result.renewed.empty()) {
         out_next->revision = self->tree.revision;
         return result;
     }
     if (reason = server_wait_for_confirmation(self); !reason.empty() && !order.ends_wait)
-        return refused(LC_ASSERTION, reason);
+        return refuse_commit(LC_ASSERTION, reason);
     const commit_extent extent = {result.changes.size(),
                                   result.changes.empty() ? result.renewed.data() : &result.changes[0].name};
     if (!order.check_only && !server_save(self, *out_next, self->comments, order, extent, &reason))
-        return refused(LC_IO_ERROR, "The configuration could not be saved: " + reason);
+        return refuse_commit(LC_IO_ERROR, "The configuration could not be saved: " + reason);
     return result;
 }
 
-static std::string count_text(size_t changes) {
+std::string describe_node_count(size_t changes) {
     return std::to_string(changes) + (changes == 1 ? " node" : " nodes");
 }
+
+} // namespace
 
 commit_result server_commit(server *self, const std::vector<set_step> &steps, const commit_order &order) {
     node_tree next;
     commit_result result = prepare_commit(self, steps, order, &next);
     if (order.check_only) {
         if (result.code == 0)
-            result.message = count_text(result.changes.size()) + " would change";
+            result.message = describe_node_count(result.changes.size()) + " would change";
         return result;
     }
     if (result.code != 0) {
@@ -200,8 +212,12 @@ commit_result server_commit(server *self, const std::vector<set_step> &steps, co
 
 // --- Bypasses that end by themselves
 
+namespace {
+
 // The clock may be set: while there is an entry with a time, it is looked at each minute.
-static constexpr int64_t CLOCK_LOOK_MS = 60000;
+constexpr int64_t CLOCK_LOOK_MS = 60000;
+
+} // namespace
 
 int64_t server_expire_bypasses(server *self) {
     static const node_name pattern = parsed_name(NODE_BYPASS_CONFIG "/*/until");
@@ -231,18 +247,23 @@ int64_t server_expire_bypasses(server *self) {
 
 // --- The file
 
-static void append_lines(const server *self, const config_text &text, const std::vector<std::string> &reasons,
-                         std::string *out) {
+namespace {
+
+void append_complaints(const server *self, const config_text &text, const std::vector<std::string> &reasons,
+                       std::string *out) {
     for (const std::string &reason : reasons)
         *out += config_complaint(self->file.path, text.lines, reason);
 }
+
+} // namespace
 
 bool server_load(server *self, std::string *out_errors, std::string *out_warnings) {
     config_text text;
     const bool good = config_load(&self->file, &text);
     *out_errors = text.errors;
     if (good)
-        append_lines(self, text, find_bad_routers(text.tree, nullptr, self->local_addresses()), out_warnings);
+        append_complaints(self, text, find_bad_routers(text.tree, nullptr, self->local_addresses()),
+                          out_warnings);
     self->tree = std::move(text.tree);
     self->comments = std::move(text.comments);
     return good;
@@ -257,7 +278,9 @@ void server_begin(server *self) {
     server_open_history(self);
 }
 
-static bool read_again(server *self, config_text *out, std::string *out_warnings) {
+namespace {
+
+bool read_file_again(server *self, config_text *out, std::string *out_warnings) {
     // A file that is gone for a moment is no wish to have everything deleted.
     if (access(self->file.path.c_str(), R_OK) != 0) {
         out->errors = self->file.path + ": " + strerror(errno) + "\n";
@@ -268,19 +291,19 @@ static bool read_again(server *self, config_text *out, std::string *out_warnings
         return false;
     const std::vector<local_address> local = self->local_addresses();
     std::string reason;
-    append_lines(self, *out, find_bad_routers(out->tree, &self->tree, local), &out->errors);
+    append_complaints(self, *out, find_bad_routers(out->tree, &self->tree, local), &out->errors);
     if (!tree_check_change(self->tree, out->tree, &reason))
         out->errors += config_complaint(file.path, out->lines, reason);
     if (!out->errors.empty())
         return false;
-    append_lines(self, *out, find_bad_routers(out->tree, nullptr, local), out_warnings);
+    append_complaints(self, *out, find_bad_routers(out->tree, nullptr, local), out_warnings);
     self->file = std::move(file);
     return true;
 }
 
 // What was read is one commit, of a file that is written already. False with the reason.
-static bool keep_reload(server *self, const config_text &read, const std::vector<node_change> &changes,
-                        std::string *out_reason) {
+bool keep_reload(server *self, const config_text &read, const std::vector<node_change> &changes,
+                 std::string *out_reason) {
     if (changes.empty())
         return true;
     if (*out_reason = server_wait_for_confirmation(self); !out_reason->empty())
@@ -289,11 +312,13 @@ static bool keep_reload(server *self, const config_text &read, const std::vector
                        {changes.size(), &changes[0].name}, out_reason);
 }
 
+} // namespace
+
 void server_reload(server *self) {
     config_text text;
     std::string warnings, reason;
     const config_file before = self->file;
-    if (!read_again(self, &text, &warnings)) {
+    if (!read_file_again(self, &text, &warnings)) {
         self->say("configuration not read again:\n" + text.errors);
         return;
     }

@@ -22,8 +22,10 @@ bool config_load(config_file *file, config_text *out) {
     return false;
 }
 
+namespace {
+
 // Of a file that is gone nothing is lost.
-static bool is_as_seen(const config_file &file, std::string *out_reason) {
+bool is_as_seen(const config_file &file, std::string *out_reason) {
     std::optional<std::string> now;
     if (!read_whole_file(file.path, &now, out_reason))
         return false;
@@ -35,7 +37,7 @@ static bool is_as_seen(const config_file &file, std::string *out_reason) {
     return false;
 }
 
-static bool reads_the_same(const std::string &written, const node_tree &tree, std::string *out_reason) {
+bool reads_the_same(const std::string &written, const node_tree &tree, std::string *out_reason) {
     config_text again;
     if (config_parse(written, "what was written", &again) && again.tree.set == tree.set)
         return true;
@@ -44,6 +46,8 @@ static bool reads_the_same(const std::string &written, const node_tree &tree, st
         *out_reason += ": " + again.errors.substr(0, again.errors.find('\n'));
     return false;
 }
+
+} // namespace
 
 bool config_save(config_file *file, const node_tree &tree, const config_comments &comments,
                  std::string *out_reason) {

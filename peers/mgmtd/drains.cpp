@@ -11,22 +11,24 @@
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 
-static node_name report_of(uint8_t group) {
+namespace {
+
+node_name name_drain_report(uint8_t group) {
     return parsed_name(NODE_DRAINS).below(std::to_string(group));
 }
 
-static std::string words_for(uint8_t group) {
+std::string describe_group(uint8_t group) {
     return "group " + std::to_string(group);
 }
 
-static const std::string *configured_admin(const server *self, uint8_t group) {
+const std::string *find_configured_admin(const server *self, uint8_t group) {
     const auto found =
         self->tree.nodes.find(parsed_name(NODE_GROUP_CONFIG).below(std::to_string(group)).below("admin"));
     return found == self->tree.nodes.end() ? nullptr : &found->second.text;
 }
 
-static bool read_number(const std::vector<event_field> &fields, const char *name, uint32_t type,
-                        uint32_t *out) {
+bool read_number_field(const std::vector<event_field> &fields, const char *name, uint32_t type,
+                       uint32_t *out) {
     const std::string *field = find_field(fields, name);
     std::string text;
     if (!field || !canonical_text(type, *field, &text))
@@ -37,10 +39,10 @@ static bool read_number(const std::vector<event_field> &fields, const char *name
 
 // --- The state of a drain
 
-static void report_drain(server *self, uint8_t group, const std::string &state) {
-    node_value &report = self->state[report_of(group)];
+void report_drain(server *self, uint8_t group, const std::string &state) {
+    node_value &report = self->state[name_drain_report(group)];
     if (report.text != state)
-        self->say(words_for(group) + ": " + state);
+        self->say(describe_group(group) + ": " + state);
     report = {bn_type_str, state};
     const int64_t flows = self->drains[group].flows;
     std::vector<event_field> fields = {{"group", {bn_type_uint8, std::to_string(group)}},
@@ -50,52 +52,52 @@ static void report_drain(server *self, uint8_t group, const std::string &state) 
     server_send_event(self, EVENT_DRAIN, fields);
 }
 
-static void leave_routers(server *self, uint8_t group, const char *state) {
+void leave_routers(server *self, uint8_t group, const char *state) {
     const group_overlay before = server_overlay_of(self, group);
     self->drains[group].left = true;
     server_send_overlay(self, group, before);
     report_drain(self, group, state);
 }
 
-static void forget_drain(server *self, uint8_t group) {
+void forget_drain(server *self, uint8_t group) {
     self->drains.erase(group);
-    server_remove_report(self, report_of(group));
+    server_remove_report(self, name_drain_report(group));
 }
 
 // --- Actions
 
-static void begin_drain(server *self, uint8_t group, uint32_t seconds) {
+void begin_drain(server *self, uint8_t group, uint32_t seconds) {
     const group_overlay before = server_overlay_of(self, group);
     const bool fresh = !self->drains.contains(group);
     drain_request &drain = self->drains[group];
     if (drain.left)
         return;
     drain.until_ms = self->now_ms() + int64_t{seconds} * 1000;
-    const node_name report = report_of(group);
+    const node_name report = name_drain_report(group);
     if (fresh)
         self->state[report.below("since")] = server_time_now();
     self->state[report.below("until")] = {bn_type_uint32, std::to_string(self->clock_s() + seconds)};
-    self->say(words_for(group) + " is to be empty within " + std::to_string(seconds) + " s");
+    self->say(describe_group(group) + " is to be empty within " + std::to_string(seconds) + " s");
     report_drain(self, group, "draining");
     server_send_overlay(self, group, before);
 }
 
 // The groups that an action is about: the one that it names, or all that are up.
-static uint32_t find_groups(const server *self, const std::vector<event_field> &fields,
-                            std::vector<uint8_t> *out, std::string *out_message) {
+uint32_t find_drain_groups(const server *self, const std::vector<event_field> &fields,
+                           std::vector<uint8_t> *out, std::string *out_message) {
     uint32_t group = 0;
     if (!find_field(fields, "group")) {
         for (uint32_t each = 0; each < 256; each++)
-            if (const std::string *admin = configured_admin(self, static_cast<uint8_t>(each));
+            if (const std::string *admin = find_configured_admin(self, static_cast<uint8_t>(each));
                 admin && *admin == "up")
                 out->push_back(static_cast<uint8_t>(each));
         return LC_OK;
     }
-    if (!read_number(fields, "group", bn_type_uint8, &group)) {
+    if (!read_number_field(fields, "group", bn_type_uint8, &group)) {
         *out_message = "group is no number between 0 and 255";
         return LC_BAD_ARGUMENT;
     }
-    const std::string *admin = configured_admin(self, static_cast<uint8_t>(group));
+    const std::string *admin = find_configured_admin(self, static_cast<uint8_t>(group));
     if (!admin) {
         *out_message = "There is no group " + std::to_string(group);
         return LC_NOT_FOUND;
@@ -104,19 +106,21 @@ static uint32_t find_groups(const server *self, const std::vector<event_field> &
     return LC_OK;
 }
 
+} // namespace
+
 uint32_t server_begin_drain(server *self, const std::vector<event_field> &fields, std::string *out_message) {
     static constexpr uint32_t SECONDS_MAX = 86400;
     std::vector<uint8_t> groups;
-    if (const uint32_t code = find_groups(self, fields, &groups, out_message))
+    if (const uint32_t code = find_drain_groups(self, fields, &groups, out_message))
         return code;
     uint32_t seconds = 0;
     if (!find_field(fields, "seconds")) {
         seconds = static_cast<uint32_t>(std::stoul(self->tree.nodes.at(parsed_name(NODE_DRAIN_TIME)).text));
-    } else if (!read_number(fields, "seconds", bn_type_uint32, &seconds) || seconds > SECONDS_MAX) {
+    } else if (!read_number_field(fields, "seconds", bn_type_uint32, &seconds) || seconds > SECONDS_MAX) {
         *out_message = "seconds is no number between 0 and " + std::to_string(SECONDS_MAX);
         return LC_BAD_ARGUMENT;
     }
-    if (groups.size() == 1 && *configured_admin(self, groups[0]) != "up") {
+    if (groups.size() == 1 && *find_configured_admin(self, groups[0]) != "up") {
         *out_message = "Group " + std::to_string(groups[0]) + " is down, there is nothing to drain";
         return LC_BAD_ARGUMENT;
     }
@@ -128,7 +132,7 @@ uint32_t server_begin_drain(server *self, const std::vector<event_field> &fields
 
 uint32_t server_cancel_drain(server *self, const std::vector<event_field> &fields, std::string *out_message) {
     std::vector<uint8_t> groups;
-    if (const uint32_t code = find_groups(self, fields, &groups, out_message))
+    if (const uint32_t code = find_drain_groups(self, fields, &groups, out_message))
         return code;
     if (!find_field(fields, "group")) { // also of those that are configured down meanwhile
         groups.clear();
@@ -158,22 +162,22 @@ void server_take_drain_progress(server *self, uint32_t peer_id, const std::vecto
     uint32_t flows = 0;
     const std::string *empty = find_field(fields, "empty");
     if (!server_read_reported_group(self, peer_id, fields, &group) ||
-        !read_number(fields, "flows", bn_type_uint32, &flows) || !empty)
+        !read_number_field(fields, "flows", bn_type_uint32, &flows) || !empty)
         return;
     const auto drain = self->drains.find(group);
     if (drain == self->drains.end())
         return;
     drain->second.flows = flows;
-    self->state[report_of(group).below("flows")] = {bn_type_uint32, std::to_string(flows)};
-    if (*empty == "true" && (!drain->second.left || self->state[report_of(group)].text == "over"))
+    self->state[name_drain_report(group).below("flows")] = {bn_type_uint32, std::to_string(flows)};
+    if (*empty == "true" && (!drain->second.left || self->state[name_drain_report(group)].text == "over"))
         leave_routers(self, group, "drained");
 }
 
 void server_take_weight(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     uint8_t group = 0;
     uint32_t percent = 0;
-    if (!server_read_reported_group(self, peer_id, fields, &group) || !configured_admin(self, group) ||
-        !read_number(fields, "percent", bn_type_uint32, &percent) || percent == 0 || percent > 100)
+    if (!server_read_reported_group(self, peer_id, fields, &group) || !find_configured_admin(self, group) ||
+        !read_number_field(fields, "percent", bn_type_uint32, &percent) || percent == 0 || percent > 100)
         return;
     const group_overlay before = server_overlay_of(self, group);
     const auto known = self->slowed.find(group);
@@ -184,7 +188,7 @@ void server_take_weight(server *self, uint32_t peer_id, const std::vector<event_
         self->slowed.erase(group);
     if (percent == last)
         return;
-    self->say(words_for(group) + " announces " + std::to_string(percent) + " % of its weight");
+    self->say(describe_group(group) + " announces " + std::to_string(percent) + " % of its weight");
     server_send_event(self, EVENT_GROUP_WEIGHT, fields);
     server_send_overlay(self, group, before);
 }
@@ -198,17 +202,15 @@ void server_orphan_weights(server *self, uint32_t peer_id) {
 }
 
 void server_forget_deleted_drains(server *self) {
-    std::erase_if(self->slowed, [&](const auto &each) { return !configured_admin(self, each.first); });
+    std::erase_if(self->slowed, [&](const auto &each) { return !find_configured_admin(self, each.first); });
     for (auto at = self->drains.begin(); at != self->drains.end();) {
         const uint8_t group = (at++)->first;
-        if (!configured_admin(self, group))
+        if (!find_configured_admin(self, group))
             forget_drain(self, group);
     }
 }
 
-static void take_earlier(int64_t *inout, int64_t at_ms) {
-    *inout = *inout < 0 || at_ms < *inout ? at_ms : *inout;
-}
+namespace {} // namespace
 
 int64_t server_end_drains(server *self) {
     const int64_t now = self->now_ms();
@@ -217,7 +219,7 @@ int64_t server_end_drains(server *self) {
         if (!drain.left && now >= drain.until_ms)
             leave_routers(self, group, drain.flows == 0 ? "drained" : "over");
         else if (!drain.left)
-            take_earlier(&next, drain.until_ms);
+            keep_earlier(&next, drain.until_ms);
     }
     const bool followed = server_has_tunneld(self);
     for (auto at = self->slowed.begin(); at != self->slowed.end();) {
@@ -228,12 +230,12 @@ int64_t server_end_drains(server *self) {
         if (slowed.reporter != 0 || (followed && wanted))
             continue;
         if (wanted && now < due) {
-            take_earlier(&next, due);
+            keep_earlier(&next, due);
             continue;
         }
         const group_overlay before = server_overlay_of(self, group);
         self->slowed.erase(group);
-        self->say(words_for(group) + " announces its weight again: nobody reports");
+        self->say(describe_group(group) + " announces its weight again: nobody reports");
         server_send_overlay(self, group, before);
     }
     return next;

@@ -10,10 +10,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-static constexpr size_t FILE_MAX_BYTES = 16u << 20;
-static constexpr int LINKS_MAX = 40; // on the way to a file, as the kernel has it
-
 namespace {
+
+constexpr size_t FILE_MAX_BYTES = 16u << 20;
+constexpr int LINKS_MAX = 40; // on the way to a file, as the kernel has it
+
 struct owned_fd {
     int fd;
     explicit owned_fd(int opened) : fd(opened) {}
@@ -39,34 +40,33 @@ struct unfinished_file {
             unlink(path.c_str());
     }
 };
-} // namespace
 
-static bool failed(std::string *out_reason) {
+bool fail_with_errno(std::string *out_reason) {
     *out_reason = strerror(errno);
     return false;
 }
 
-static std::string directory_of(const std::string &path) {
+std::string find_directory_of(const std::string &path) {
     const size_t slash = path.rfind('/');
     return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
 }
 
 // Where the file is after all links are followed; the last of them may point to nothing yet.
-static bool follow_links(const std::string &path, std::string *out, std::string *out_reason) {
+bool follow_links(const std::string &path, std::string *out, std::string *out_reason) {
     *out = path;
     for (int i = 0; i < LINKS_MAX; i++) {
         char bytes[PATH_MAX];
         const ssize_t length = readlink(out->c_str(), bytes, sizeof bytes);
         if (length < 0)
-            return errno == EINVAL || errno == ENOENT || failed(out_reason);
+            return errno == EINVAL || errno == ENOENT || fail_with_errno(out_reason);
         const std::string target(bytes, static_cast<size_t>(length));
-        *out = target[0] == '/' ? target : directory_of(*out) + "/" + target;
+        *out = target[0] == '/' ? target : find_directory_of(*out) + "/" + target;
     }
     errno = ELOOP;
-    return failed(out_reason);
+    return fail_with_errno(out_reason);
 }
 
-static bool read_all(int fd, std::string *out) {
+bool read_all(int fd, std::string *out) {
     char bytes[65536];
     ssize_t got;
     while ((got = read(fd, bytes, sizeof bytes)) != 0) {
@@ -82,23 +82,27 @@ static bool read_all(int fd, std::string *out) {
     return true;
 }
 
+} // namespace
+
 bool read_whole_file(const std::string &path, std::optional<std::string> *out, std::string *out_reason) {
     out->reset();
     // A pipe would block the open and a device would be replaced by a file.
     const owned_fd file(open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
     if (file.fd < 0)
-        return errno == ENOENT || failed(out_reason);
+        return errno == ENOENT || fail_with_errno(out_reason);
     struct stat about;
     if (fstat(file.fd, &about) != 0)
-        return failed(out_reason);
+        return fail_with_errno(out_reason);
     if (!S_ISREG(about.st_mode)) {
         *out_reason = "is not a regular file";
         return false;
     }
-    return read_all(file.fd, &out->emplace()) || failed(out_reason);
+    return read_all(file.fd, &out->emplace()) || fail_with_errno(out_reason);
 }
 
-static bool write_whole(int fd, const std::string &content) {
+namespace {
+
+bool write_all(int fd, const std::string &content) {
     for (size_t done = 0; done < content.size();) {
         const ssize_t wrote = write(fd, content.data() + done, content.size() - done);
         if (wrote < 0 && errno != EINTR)
@@ -109,11 +113,13 @@ static bool write_whole(int fd, const std::string &content) {
     return fsync(fd) == 0;
 }
 
-static void sync_directory(const std::string &file) {
-    const owned_fd directory(open(directory_of(file).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+void sync_directory(const std::string &file) {
+    const owned_fd directory(open(find_directory_of(file).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (directory.fd >= 0)
         (void)fsync(directory.fd);
 }
+
+} // namespace
 
 bool rename_file(const std::string &from, const std::string &to) {
     if (rename(from.c_str(), to.c_str()) != 0)
@@ -130,13 +136,13 @@ bool replace_file(const std::string &path, const std::string &content, mode_t mo
     unfinished_file fresh(target);
     const owned_fd file(
         open(fresh.path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR));
-    if (file.fd < 0 || fchmod(file.fd, mode) != 0 || !write_whole(file.fd, content) ||
+    if (file.fd < 0 || fchmod(file.fd, mode) != 0 || !write_all(file.fd, content) ||
         lseek(file.fd, 0, SEEK_SET) != 0 || !read_all(file.fd, &written))
-        return failed(out_reason);
+        return fail_with_errno(out_reason);
     if (accept && !accept(written, out_reason))
         return false;
     if (!rename_file(fresh.path, target))
-        return failed(out_reason);
+        return fail_with_errno(out_reason);
     fresh.renamed = true;
     return true;
 }

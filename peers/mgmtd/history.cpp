@@ -31,24 +31,26 @@
 #include "peers/nodes/config_text.h"
 #include "peers/nodes/schema.h"
 
-static const std::string FILE_PREFIX = "commit-";
+namespace {
 
-static std::string pending_path(const history &self) {
+const std::string FILE_PREFIX = "commit-";
+
+std::string pending_path(const history &self) {
     return self.directory + "/pending";
 }
-static std::string entry_path(const history &self, uint32_t number) {
+std::string entry_path(const history &self, uint32_t number) {
     return self.directory + "/" + FILE_PREFIX + std::to_string(number);
 }
 
 template <typename Number>
-static bool read_number(const std::string &text, Number *out) {
+bool parse_number(const std::string &text, Number *out) {
     const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), *out);
     return error == std::errc() && end == text.data() + text.size() && !text.empty();
 }
 
 // --- The form of an entry
 
-static std::string format_entry(const history_entry &entry, const std::string &text) {
+std::string format_entry(const history_entry &entry, const std::string &text) {
     std::vector<std::pair<const char *, std::string>> lines = {
         {"commit", std::to_string(entry.number)},   {"time", std::to_string(entry.time_s)},
         {"user", shown_text(entry.user)},           {"cause", shown_text(entry.cause)},
@@ -65,7 +67,7 @@ static std::string format_entry(const history_entry &entry, const std::string &t
 }
 
 // False for what was not written by format_entry.
-static bool parse_entry(const std::string &content, history_entry *out, std::string *out_text) {
+bool parse_entry(const std::string &content, history_entry *out, std::string *out_text) {
     std::map<std::string, std::string> words;
     size_t at = 0;
     for (size_t end; content.starts_with(CONFIG_NOTE) && (end = content.find('\n', at)) != std::string::npos;
@@ -85,18 +87,17 @@ static bool parse_entry(const std::string &content, history_entry *out, std::str
     out->cause = words["cause"];
     out->what = words["what"];
     const bool waits = words.contains("returns-to");
-    if (!read_number(words["commit"], &out->number) || !read_number(words["time"], &out->time_s) ||
-        !read_number(words["changes"], &out->changes) ||
-        (waits && (!read_number(words["returns-to"], &out->returns_to) ||
-                   !read_number(words["confirm-by"], &out->confirm_by_s))) ||
+    if (!parse_number(words["commit"], &out->number) || !parse_number(words["time"], &out->time_s) ||
+        !parse_number(words["changes"], &out->changes) ||
+        (waits && (!parse_number(words["returns-to"], &out->returns_to) ||
+                   !parse_number(words["confirm-by"], &out->confirm_by_s))) ||
         at >= content.size())
         return false;
     *out_text = content.substr(at + 1);
     return true;
 }
 
-static bool read_entry(const std::string &path, history_entry *out, std::string *out_text,
-                       std::string *out_reason) {
+bool read_entry(const std::string &path, history_entry *out, std::string *out_text, std::string *out_reason) {
     std::optional<std::string> content;
     if (!read_whole_file(path, &content, out_reason))
         return false;
@@ -106,14 +107,14 @@ static bool read_entry(const std::string &path, history_entry *out, std::string 
 
 // --- The directory
 
-static void forget_old(history *self) {
+void forget_old(history *self) {
     while (self->entries.size() > HISTORY_MAX) {
         unlink(entry_path(*self, self->entries.front().number).c_str());
         self->entries.erase(self->entries.begin());
     }
 }
 
-static void read_entries(history *self, const std::function<void(const std::string &line)> &say) {
+void read_entries(history *self, const std::function<void(const std::string &line)> &say) {
     std::error_code error;
     for (std::filesystem::directory_iterator at(self->directory, error), end; !error && at != end;
          at.increment(error)) {
@@ -121,7 +122,7 @@ static void read_entries(history *self, const std::function<void(const std::stri
         history_entry entry;
         uint32_t number = 0;
         std::string text, reason;
-        if (!name.starts_with(FILE_PREFIX) || !read_number(name.substr(FILE_PREFIX.size()), &number))
+        if (!name.starts_with(FILE_PREFIX) || !parse_number(name.substr(FILE_PREFIX.size()), &number))
             continue;
         if (read_entry(at->path(), &entry, &text, &reason) && entry.number == number)
             self->entries.push_back(std::move(entry));
@@ -132,8 +133,8 @@ static void read_entries(history *self, const std::function<void(const std::stri
     std::ranges::sort(self->entries, {}, &history_entry::number);
 }
 
-static void settle_pending(history *self, const std::string &content,
-                           const std::function<void(const std::string &line)> &say) {
+void settle_pending(history *self, const std::string &content,
+                    const std::function<void(const std::string &line)> &say) {
     const std::string pending = pending_path(*self);
     (void)remove_unfinished_file(pending);
     history_entry entry;
@@ -149,6 +150,8 @@ static void settle_pending(history *self, const std::string &content,
     unlink(pending.c_str());
 }
 
+} // namespace
+
 void history_open(history *self, const std::string &content,
                   const std::function<void(const std::string &line)> &say) {
     self->entries.clear();
@@ -161,17 +164,21 @@ void history_open(history *self, const std::string &content,
 
 // --- Commits
 
-static bool failed(const history &self, std::string *out_reason) {
+namespace {
+
+bool fail_in_directory(const history &self, std::string *out_reason) {
     *out_reason = self.directory + ": " + strerror(errno);
     return false;
 }
+
+} // namespace
 
 bool history_prepare(const history &self, const history_entry &entry, const std::string &text,
                      std::string *out_reason) {
     if (self.directory.empty())
         return true;
     if (mkdir(self.directory.c_str(), S_IRWXU) != 0 && errno != EEXIST)
-        return failed(self, out_reason);
+        return fail_in_directory(self, out_reason);
     if (replace_file(pending_path(self), format_entry(entry, text), S_IRUSR | S_IWUSR, nullptr, out_reason))
         return true;
     *out_reason = self.directory + ": " + *out_reason;
@@ -187,7 +194,7 @@ bool history_finish(history *self, const history_entry &entry, std::string *out_
     if (self->directory.empty())
         return true;
     if (!rename_file(pending_path(*self), entry_path(*self, entry.number)))
-        return failed(*self, out_reason);
+        return fail_in_directory(*self, out_reason);
     self->entries.push_back(entry);
     forget_old(self);
     return true;

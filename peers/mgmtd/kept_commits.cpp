@@ -17,14 +17,18 @@
 #include "peers/mgmtd/server.h"
 #include "peers/nodes/secrets.h"
 
-static constexpr int64_t RETRY_MS = 60000; // of a return that failed, as when the disk is full
+namespace {
 
-static const history_entry *waiting_commit(const server *self) {
+constexpr int64_t RETRY_MS = 60000; // of a return that failed, as when the disk is full
+
+const history_entry *waiting_commit(const server *self) {
     if (self->kept.entries.empty())
         return nullptr;
     const history_entry &last = self->kept.entries.back();
     return last.returns_to != 0 && last.number == self->tree.revision ? &last : nullptr;
 }
+
+} // namespace
 
 // --- Nodes
 
@@ -48,12 +52,14 @@ void server_show_commits(server *self) {
     }
 }
 
-static std::string hidden_text(node_tree tree) {
+namespace {
+
+std::string hidden_text(node_tree tree) {
     hide_secrets(&tree.set);
     return config_format(tree, {});
 }
 
-static bool kept_text(const server *self, const node_name &name, bool hide, std::string *out) {
+bool kept_text(const server *self, const node_name &name, bool hide, std::string *out) {
     std::string number, reason;
     config_text text;
     if (!canonical_text(bn_type_uint32, name.parts[name.parts.size() - 2], &number) ||
@@ -65,6 +71,8 @@ static bool kept_text(const server *self, const node_name &name, bool hide, std:
     *out = hidden_text(text.tree);
     return good;
 }
+
+} // namespace
 
 bool server_config_text(const server *self, const node_name &name, bool hide, node_value *out) {
     static const node_name present = parsed_name(NODE_CONFIG_TEXT),
@@ -80,8 +88,10 @@ bool server_config_text(const server *self, const node_name &name, bool hide, no
 
 // --- Keeping
 
-static history_entry make_entry(const server *self, uint32_t number, const commit_order &order,
-                                commit_extent extent) {
+namespace {
+
+history_entry make_entry(const server *self, uint32_t number, const commit_order &order,
+                         commit_extent extent) {
     history_entry entry;
     entry.number = number;
     entry.time_s = self->clock_s();
@@ -96,6 +106,8 @@ static history_entry make_entry(const server *self, uint32_t number, const commi
     return entry;
 }
 
+} // namespace
+
 bool server_keep(server *self, const node_tree &next, const config_comments &comments,
                  const commit_order &order, commit_extent extent, std::string *out_reason) {
     const history_entry entry = make_entry(self, next.revision, order, extent);
@@ -103,12 +115,16 @@ bool server_keep(server *self, const node_tree &next, const config_comments &com
            history_finish(&self->kept, entry, out_reason);
 }
 
+namespace {
+
 // The configuration that a commit replaces is kept as well, whatever has become of it in the history.
-static bool keep_present(server *self, const char *cause, std::string *out_reason) {
+bool keep_present(server *self, const char *cause, std::string *out_reason) {
     if (self->kept.directory.empty() || history_find(self->kept, self->tree.revision))
         return true;
     return server_keep(self, self->tree, self->comments, {"", "", cause}, {}, out_reason);
 }
+
+} // namespace
 
 bool server_save(server *self, const node_tree &next, const config_comments &comments,
                  const commit_order &order, commit_extent extent, std::string *out_reason) {
@@ -149,13 +165,17 @@ void server_open_history(server *self) {
 
 // --- Confirmation
 
-static std::string clock_text(int64_t time_s) {
+namespace {
+
+std::string clock_text(int64_t time_s) {
     char text[32];
     const time_t at = time_s;
     tm broken{};
     localtime_r(&at, &broken);
     return {text, strftime(text, sizeof text, "%F %T", &broken)};
 }
+
+} // namespace
 
 std::string server_wait_for_confirmation(const server *self) {
     const history_entry *entry = waiting_commit(self);
@@ -181,8 +201,10 @@ commit_result server_confirm(server *self, const std::string &who) {
     return {0, "commit " + number, {}, {}};
 }
 
+namespace {
+
 // What was in force once is not checked again as a change: a return must not fail because of where it starts.
-static bool return_to(server *self, const history_entry &entry, std::string *out_reason) {
+bool return_to(server *self, const history_entry &entry, std::string *out_reason) {
     const commit_order order = {"mgmtd", "mgmtd",
                                 "return to commit " + std::to_string(entry.returns_to) + ": commit " +
                                     std::to_string(entry.number) + " was not confirmed"};
@@ -205,6 +227,8 @@ static bool return_to(server *self, const history_entry &entry, std::string *out
     server_take_over(self, std::move(text.tree), commit);
     return true;
 }
+
+} // namespace
 
 int64_t server_return_unconfirmed(server *self) {
     const history_entry *waiting = waiting_commit(self);

@@ -10,7 +10,11 @@
 #include "peers/mgmtd/server.h"
 #include "peers/nodes/schema.h"
 
-static constexpr size_t REASON_MAX = 256;
+namespace {
+
+constexpr size_t REASON_MAX = 256;
+
+} // namespace
 
 bool server_runs_groups(const peer &who) {
     return who.name.starts_with("wccpd-");
@@ -27,13 +31,17 @@ bool server_has_tunneld(const server *self) {
     return false;
 }
 
-static node_name report_of(uint8_t group) {
+namespace {
+
+node_name name_leave_report(uint8_t group) {
     return parsed_name(NODE_LEFT_GROUPS).below(std::to_string(group));
 }
 
-static bool exists(const server *self, const char *root, uint8_t group) {
+bool has_group_node(const server *self, const char *root, uint8_t group) {
     return self->tree.nodes.contains(parsed_name(root).below(std::to_string(group)));
 }
+
+} // namespace
 
 // --- Reports
 
@@ -48,30 +56,35 @@ bool server_read_reported_group(const server *self, uint32_t peer_id, const std:
     return true;
 }
 
-static std::string read_reason(const std::vector<event_field> &fields) {
+namespace {
+
+std::string read_leave_reason(const std::vector<event_field> &fields) {
     const std::string *reason = find_field(fields, "reason");
     return reason ? shown_text(reason->substr(0, REASON_MAX)) : "";
 }
 
-static void end_leave(server *self, uint8_t group, const std::string &why) {
+void end_leave(server *self, uint8_t group, const std::string &why) {
     const group_overlay before = server_overlay_of(self, group);
     if (self->left.erase(group) == 0)
         return;
-    server_remove_report(self, report_of(group));
+    server_remove_report(self, name_leave_report(group));
     self->say("group " + std::to_string(group) + " joins its routers again: " + why);
     server_send_event(self, EVENT_GROUP_JOIN, {{"group", {bn_type_uint8, std::to_string(group)}}});
     server_send_overlay(self, group, before);
 }
 
+} // namespace
+
 void server_take_leave(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     uint8_t group = 0;
-    if (!server_read_reported_group(self, peer_id, fields, &group) || !exists(self, NODE_GROUP_CONFIG, group))
+    if (!server_read_reported_group(self, peer_id, fields, &group) ||
+        !has_group_node(self, NODE_GROUP_CONFIG, group))
         return;
     const group_overlay before = server_overlay_of(self, group);
     const bool first = !self->left.contains(group);
     self->left[group] = {peer_id, 0};
-    const node_name report = report_of(group);
-    self->state[report] = {bn_type_str, read_reason(fields)};
+    const node_name report = name_leave_report(group);
+    self->state[report] = {bn_type_str, read_leave_reason(fields)};
     if (!first)
         return;
     self->state[report.below("since")] = server_time_now();
@@ -93,7 +106,7 @@ void server_take_proxy_change(server *self, uint32_t peer_id, const std::vector<
     if (!server_read_reported_group(self, peer_id, fields, &group) || !up)
         return;
     self->say("proxy of group " + std::to_string(group) +
-              (*up == "true" ? ": up" : ": down, " + read_reason(fields)));
+              (*up == "true" ? ": up" : ": down, " + read_leave_reason(fields)));
     if (*up == "true")
         end_leave(self, group, "its proxy is up");
 }
@@ -109,10 +122,10 @@ void server_orphan_left_groups(server *self, uint32_t peer_id) {
 void server_forget_deleted_groups(server *self) {
     for (auto at = self->left.begin(); at != self->left.end();) {
         const auto [group, left] = *at++;
-        if (exists(self, NODE_GROUP_CONFIG, group))
+        if (has_group_node(self, NODE_GROUP_CONFIG, group))
             continue;
         self->left.erase(group);
-        server_remove_report(self, report_of(group));
+        server_remove_report(self, name_leave_report(group));
     }
 }
 
@@ -125,7 +138,7 @@ int64_t server_drop_left_groups(server *self) {
         const int64_t due = left.orphaned_ms + LEFT_KEEP_MS;
         if (left.reporter != 0)
             continue;
-        if (!exists(self, NODE_INTERCEPT_CONFIG, group))
+        if (!has_group_node(self, NODE_INTERCEPT_CONFIG, group))
             end_leave(self, group, "it has no intercept any more");
         else if (!followed && now >= due)
             end_leave(self, group, "tunneld is gone");

@@ -33,42 +33,44 @@
 #include "peers/nodes/provider_path.h"
 #include "runtime/common.h"
 
-static constexpr int BACKLOG = 64;
-static constexpr int MOVES_MAX = 1000;     // names that are tried for what is moved aside
-static constexpr int DIRECTORY_TRIES = 16; // against somebody who makes it again at the same time
+namespace {
 
-static bool fail(std::string *out_error, const std::string &what) {
+constexpr int BACKLOG = 64;
+constexpr int MOVES_MAX = 1000;     // names that are tried for what is moved aside
+constexpr int DIRECTORY_TRIES = 16; // against somebody who makes it again at the same time
+
+bool fail_with_errno(std::string *out_error, const std::string &what) {
     *out_error = what + ": " + strerror(errno);
     return false;
 }
 
-static void close_fd(int *fd) {
+void close_fd(int *fd) {
     if (*fd >= 0)
         close(*fd);
     *fd = -1;
 }
 
-static bool lock_alone(int fd, const std::string &path, std::string *out_error) {
+bool lock_alone(int fd, const std::string &path, std::string *out_error) {
     if (flock(fd, LOCK_EX | LOCK_NB) == 0)
         return true;
     if (errno != EWOULDBLOCK)
-        return fail(out_error, path);
+        return fail_with_errno(out_error, path);
     *out_error = "another mgmtd runs";
     return false;
 }
 
-static bool take_lock_file(listener *self, std::string *out_error) {
+bool take_lock_file(listener *self, std::string *out_error) {
     if (geteuid() != 0)
         return true; // /var/run is root's
     self->lock = open(MGMTD_LOCK_FILE, O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600);
     if (self->lock < 0)
-        return fail(out_error, MGMTD_LOCK_FILE);
+        return fail_with_errno(out_error, MGMTD_LOCK_FILE);
     return lock_alone(self->lock, MGMTD_LOCK_FILE, out_error);
 }
 
 // --- The directory
 
-static bool move_aside(const listener *self, const std::string &path, uid_t owner, std::string *out_error) {
+bool move_aside(const listener *self, const std::string &path, uid_t owner, std::string *out_error) {
     for (int i = 1; i <= MOVES_MAX; i++) {
         const std::string aside = path + ".moved-" + std::to_string(i);
         if (renameat2(AT_FDCWD, path.c_str(), AT_FDCWD, aside.c_str(), RENAME_NOREPLACE) == 0) {
@@ -80,19 +82,20 @@ static bool move_aside(const listener *self, const std::string &path, uid_t owne
         if (errno != EEXIST)
             break;
     }
-    return fail(out_error, path + ": belongs to user " + std::to_string(owner) + " and can't be moved aside");
+    return fail_with_errno(out_error,
+                           path + ": belongs to user " + std::to_string(owner) + " and can't be moved aside");
 }
 
 // False with the reason; `out_again` when it is worth another try.
-static bool open_own_directory(const listener *self, const std::string &path, int *out_fd, bool *out_again,
-                               std::string *out_error) {
+bool open_own_directory(const listener *self, const std::string &path, int *out_fd, bool *out_again,
+                        std::string *out_error) {
     struct stat about;
     *out_again = false;
     if (mkdir(path.c_str(), 0755) != 0 && errno != EEXIST)
-        return fail(out_error, path);
+        return fail_with_errno(out_error, path);
     if (lstat(path.c_str(), &about) != 0) {
         *out_again = errno == ENOENT;
-        return fail(out_error, path);
+        return fail_with_errno(out_error, path);
     }
     if (about.st_uid != geteuid() && geteuid() == 0) {
         *out_again = move_aside(self, path, about.st_uid, out_error);
@@ -100,14 +103,14 @@ static bool open_own_directory(const listener *self, const std::string &path, in
     }
     *out_fd = open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
     if (*out_fd < 0 || fstat(*out_fd, &about) != 0)
-        return fail(out_error, path);
+        return fail_with_errno(out_error, path);
     if (about.st_uid == geteuid())
         return true;
     *out_error = path + ": belongs to user " + std::to_string(about.st_uid) + ", not to us";
     return false;
 }
 
-static bool open_directory(const listener *self, int *out_fd, std::string *out_error) {
+bool open_directory(const listener *self, int *out_fd, std::string *out_error) {
     const std::string path(GCL_SOCKET_DIRECTORY, strlen(GCL_SOCKET_DIRECTORY) - 1);
     bool again = true;
     for (int i = 0; again && i < DIRECTORY_TRIES; i++) {
@@ -115,14 +118,14 @@ static bool open_directory(const listener *self, int *out_fd, std::string *out_e
         if (!open_own_directory(self, path, out_fd, &again, out_error))
             continue;
         if (fchmod(*out_fd, 0755) != 0)
-            return fail(out_error, path);
+            return fail_with_errno(out_error, path);
         return lock_alone(*out_fd, path, out_error);
     }
     return false;
 }
 
 // The process that a client's socket is of, by its name "uds-client-NAME-PID"; 0 for other files.
-static pid_t client_of_socket(std::string_view file) {
+pid_t find_client_of(std::string_view file) {
     pid_t pid = 0;
     const size_t dash = file.rfind('-');
     if (!file.starts_with("uds-client-") || dash == std::string_view::npos)
@@ -131,6 +134,8 @@ static pid_t client_of_socket(std::string_view file) {
     const auto [last, error] = std::from_chars(file.data() + dash + 1, end, pid);
     return error == std::errc() && last == end && pid > 0 ? pid : 0;
 }
+
+} // namespace
 
 void listener_tidy(const listener *self) {
     const int fd = openat(self->directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
@@ -142,7 +147,7 @@ void listener_tidy(const listener *self) {
     }
     const std::unique_ptr<DIR, int (*)(DIR *)> files(opened, closedir);
     while (const dirent *file = readdir(files.get())) {
-        const pid_t pid = client_of_socket(file->d_name);
+        const pid_t pid = find_client_of(file->d_name);
         struct stat about;
         if (pid > 0 && kill(pid, 0) != 0 && errno == ESRCH &&
             fstatat(self->directory, file->d_name, &about, AT_SYMLINK_NOFOLLOW) == 0 &&
@@ -153,8 +158,10 @@ void listener_tidy(const listener *self) {
 
 // --- The socket
 
+namespace {
+
 // A process of that group needs no privilege for it: its socket is the group's already.
-static void admit_viewers(listener *self) {
+void admit_viewers(listener *self) {
     struct stat about;
     if (self->viewers == static_cast<gid_t>(-1))
         return;
@@ -167,7 +174,7 @@ static void admit_viewers(listener *self) {
     self->viewers = static_cast<gid_t>(-1);
 }
 
-static bool open_socket(listener *self, std::string *out_error) {
+bool open_socket(listener *self, std::string *out_error) {
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     strlcpy(address.sun_path, self->path.c_str(), sizeof address.sun_path);
@@ -177,7 +184,7 @@ static bool open_socket(listener *self, std::string *out_error) {
         return false;
     self->socket = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (self->socket < 0)
-        return fail(out_error, "socket");
+        return fail_with_errno(out_error, "socket");
     // The length that clients connect with may count less than the whole record; the path decides.
     const mode_t before = umask(0177);
     const int bound = bind(self->socket, reinterpret_cast<sockaddr *>(&address), sizeof address);
@@ -185,24 +192,26 @@ static bool open_socket(listener *self, std::string *out_error) {
     if (bound == 0)
         admit_viewers(self);
     if (bound != 0 || listen(self->socket, BACKLOG) != 0 || lstat(address.sun_path, &about) != 0)
-        return fail(out_error, self->path);
+        return fail_with_errno(out_error, self->path);
     self->group = about.st_gid;
     self->device = about.st_dev;
     self->inode = about.st_ino;
     return true;
 }
 
-static bool open_place(listener *self, std::string *out_error) {
+bool open_place(listener *self, std::string *out_error) {
     if (!open_directory(self, &self->directory, out_error))
         return false;
     listener_tidy(self);
     return open_socket(self, out_error);
 }
 
-static void close_place(listener *self) {
+void close_place(listener *self) {
     close_fd(&self->socket);
     close_fd(&self->directory);
 }
+
+} // namespace
 
 bool listener_open(listener *self, std::string *out_error) {
     self->path = provider_path();
@@ -211,11 +220,15 @@ bool listener_open(listener *self, std::string *out_error) {
     return take_lock_file(self, out_error) && open_place(self, out_error);
 }
 
-static bool is_in_place(const listener &self) {
+namespace {
+
+bool is_in_place(const listener &self) {
     struct stat about;
     return self.socket >= 0 && lstat(self.path.c_str(), &about) == 0 && about.st_dev == self.device &&
            about.st_ino == self.inode;
 }
+
+} // namespace
 
 void listener_check(listener *self) {
     if (is_in_place(*self))

@@ -19,11 +19,13 @@
 #include "runtime/ttime.h"
 #include "runtime/version.h"
 
-static constexpr uint32_t COMPONENT_MGMTD = 5u << 16;
+namespace {
+
+constexpr uint32_t COMPONENT_MGMTD = 5u << 16;
 
 // Nobody has to read this output: a pipe that is full, or a terminal that is stopped, loses lines and blocks
 // nothing. After POLLOUT there is room for PIPE_BUF bytes.
-static void say(const std::string &line) {
+void print_line(const std::string &line) {
     static uint64_t lost;
     std::string text = lost ? "(" + std::to_string(lost) + " lines lost)\n" + line : line;
     text.resize(std::min<size_t>(text.size(), PIPE_BUF - 1));
@@ -36,7 +38,7 @@ static void say(const std::string &line) {
         lost++;
 }
 
-static int block_signals() {
+int block_signals() {
     sigset_t set;
     sigemptyset(&set);
     for (const int number : {SIGTERM, SIGINT, SIGHUP})
@@ -46,7 +48,7 @@ static int block_signals() {
     return signalfd(-1, &set, SFD_NONBLOCK | SFD_CLOEXEC);
 }
 
-static void take_signals(int fd, server *daemon, supervisor *processes) {
+void take_signals(int fd, server *daemon, supervisor *processes) {
     signalfd_siginfo info;
     while (read(fd, &info, sizeof info) == sizeof info) {
         if (info.ssi_signo == SIGHUP)
@@ -56,7 +58,7 @@ static void take_signals(int fd, server *daemon, supervisor *processes) {
     }
 }
 
-static int64_t time_left(int64_t now, std::initializer_list<int64_t> due) {
+int64_t find_time_left(int64_t now, std::initializer_list<int64_t> due) {
     int64_t left = -1;
     for (const int64_t at : due)
         if (at >= 0 && (left < 0 || at - now < left))
@@ -65,7 +67,7 @@ static int64_t time_left(int64_t now, std::initializer_list<int64_t> due) {
 }
 
 // To the service manager, when it is due. Gives the time of the next report, or -1.
-static int64_t report_alive(int64_t *inout_at_ms) {
+int64_t report_alive(int64_t *inout_at_ms) {
     if (service_watchdog_ms() < 0)
         return -1;
     const int64_t now = lt_monotonic_ms();
@@ -75,6 +77,8 @@ static int64_t report_alive(int64_t *inout_at_ms) {
     }
     return *inout_at_ms;
 }
+
+} // namespace
 
 // NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
@@ -109,7 +113,7 @@ int main(int argc, char **argv) {
         return good ? 0 : 1;
     daemon.facility_file = LC_LOG_FACILITY_FILE;
     daemon.now_ms = lt_monotonic_ms;
-    daemon.say = say;
+    daemon.say = print_line;
     daemon.supervises = supervise;
 
     const int signals = block_signals();
@@ -121,11 +125,11 @@ int main(int argc, char **argv) {
     }
     server_begin(&daemon);
     service_report("READY=1");
-    say("mgmtd ready, " + std::to_string(daemon.tree.nodes.size()) + " nodes");
+    print_line("mgmtd ready, " + std::to_string(daemon.tree.nodes.size()) + " nodes");
 
     supervisor processes;
     processes.now_ms = lt_monotonic_ms;
-    processes.say = say;
+    processes.say = print_line;
     processes.tell = [&](const std::string &event, const std::string &process) {
         server_process_event(&daemon, event, process);
     };
@@ -148,14 +152,15 @@ int main(int argc, char **argv) {
         const int64_t query_due = server_tick(&daemon), alive_due = report_alive(&alive_at_ms);
         std::vector<pollfd> others = {{signals, POLLIN, 0}};
         supervisor_watch(processes, &others);
-        transport_round(&sockets, &others, time_left(lt_monotonic_ms(), {child_due, query_due, alive_due}));
+        transport_round(&sockets, &others,
+                        find_time_left(lt_monotonic_ms(), {child_due, query_due, alive_due}));
         if (others[0].revents & POLLIN)
             take_signals(signals, &daemon, &processes);
         supervisor_reap(&processes);
     }
     service_report("STOPPING=1");
     transport_close(&sockets);
-    say("mgmtd ended");
+    print_line("mgmtd ended");
     lc_log_close();
     return 0;
 }

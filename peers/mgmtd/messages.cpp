@@ -5,11 +5,15 @@
 
 // --- Events
 
-static bool append_field(bn_request_msg *msg, const std::string &name, const node_value &value) {
+namespace {
+
+bool append_field(bn_request_msg *msg, const std::string &name, const node_value &value) {
     owned_binding binding(make_binding(name, value));
     return binding.pointer &&
            bn_event_request_msg_append_binding_takeover(msg, 0, &binding.pointer, nullptr) == LC_OK;
 }
+
+} // namespace
 
 bn_request_msg *make_event(const std::string &name, const std::vector<event_field> &fields) {
     owned_request msg;

@@ -6,10 +6,14 @@
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 
-static const node_name &configured_groups() {
+namespace {
+
+const node_name &configured_groups() {
     static const node_name root = parsed_name(NODE_GROUP_CONFIG);
     return root;
 }
+
+} // namespace
 
 group_overlay server_overlay_of(const server *self, uint8_t group) {
     group_overlay out;
@@ -23,24 +27,26 @@ group_overlay server_overlay_of(const server *self, uint8_t group) {
     return out;
 }
 
+namespace {
+
 // A part of a weight is at least 1, except when there is none.
-static std::string part_of_weight(const std::string &text, uint32_t percent) {
+std::string take_part_of_weight(const std::string &text, uint32_t percent) {
     const uint64_t weight = std::stoull(text);
     if (percent == 0 || weight == 0)
         return "0";
     return std::to_string(std::max<uint64_t>(weight * percent / 100, 1));
 }
 
-static node_value laid_over(const group_overlay &overlay, const std::string &leaf, const node_value &value) {
+node_value lay_over(const group_overlay &overlay, const std::string &leaf, const node_value &value) {
     if (overlay.down && leaf == "admin")
         return {value.type, "down"};
     if (overlay.weight_percent != 100 && leaf == "weight")
-        return {value.type, part_of_weight(value.text, overlay.weight_percent)};
+        return {value.type, take_part_of_weight(value.text, overlay.weight_percent)};
     return value;
 }
 
 // The overlay that the node lies under. False: it is none of a group's own.
-static bool find_overlay(const server *self, const node_name &name, group_overlay *out) {
+bool find_overlay(const server *self, const node_name &name, group_overlay *out) {
     const size_t depth = configured_groups().parts.size();
     if (name.parts.size() != depth + 2 || !name.is_under(configured_groups()))
         return false;
@@ -48,9 +54,11 @@ static bool find_overlay(const server *self, const node_name &name, group_overla
     return true;
 }
 
+} // namespace
+
 node_value server_value_for_wccpd(const server *self, const node_name &name, const node_value &value) {
     group_overlay overlay;
-    return find_overlay(self, name, &overlay) ? laid_over(overlay, name.parts.back(), value) : value;
+    return find_overlay(self, name, &overlay) ? lay_over(overlay, name.parts.back(), value) : value;
 }
 
 void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout) {
@@ -60,7 +68,7 @@ void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout)
             return false;
         for (std::optional<node_value> *value : {&change.before, &change.after})
             if (*value)
-                **value = laid_over(overlay, change.name.parts.back(), **value);
+                **value = lay_over(overlay, change.name.parts.back(), **value);
         return change.before == change.after;
     });
 }
@@ -74,8 +82,7 @@ void server_send_overlay(server *self, uint8_t group, const group_overlay &befor
         const auto found = self->tree.nodes.find(name);
         if (found == self->tree.nodes.end())
             continue;
-        const node_value was = laid_over(before, leaf, found->second),
-                         is = laid_over(now, leaf, found->second);
+        const node_value was = lay_over(before, leaf, found->second), is = lay_over(now, leaf, found->second);
         if (was != is)
             changes.push_back({name, was, is});
     }

@@ -22,25 +22,25 @@
 #include "peers/nodes/secrets.h"
 
 namespace {
+
 struct state_source {
     const char *client; // the daemon's client name
     std::vector<const char *> roots;
     const std::vector<const char *> &(*nodes)();
 };
-} // namespace
 
-static const state_source sources[] = {
+const state_source state_sources[] = {
     {"wccpd", {NODE_WCCPD_STATE, NODE_GROUP_STATE}, wccpd_state_nodes},
     {"tunneld",
      {NODE_PLANE_STATE, NODE_TUNNEL_STATE, NODE_INTERCEPT_STATE, NODE_PROTECTION_STATE},
      tunneld_state_nodes},
 };
-static constexpr uint32_t CAPABILITIES = 1;       // the nodes can be read
-static constexpr size_t ANSWER_NODE_BYTES = 64;   // of a node in a message, beside its texts
-static constexpr size_t PENDING_NODE_BYTES = 128; // of a node that waits, beside its name
+constexpr uint32_t CAPABILITIES = 1;       // the nodes can be read
+constexpr size_t ANSWER_NODE_BYTES = 64;   // of a node in a message, beside its texts
+constexpr size_t PENDING_NODE_BYTES = 128; // of a node that waits, beside its name
 
 // The newest working session of the daemon: the one that follows changes. 0 for none.
-static uint32_t find_provider(const server *self, const state_source &source, uint32_t asker) {
+uint32_t find_provider(const server *self, const state_source &source, uint32_t asker) {
     const std::string prefix = std::string(source.client) + "-";
     uint32_t found = 0;
     uint64_t newest = 0;
@@ -56,7 +56,7 @@ static uint32_t find_provider(const server *self, const state_source &source, ui
     return found;
 }
 
-static bool append_registrations(bn_request_msg *msg, const state_source &source) {
+bool append_registrations(bn_request_msg *msg, const state_source &source) {
     owned_attribs attributes;
     owned_attrib mask;
     if (bn_attrib_new_uint32(&mask.pointer, bn_attrib_capability_mask, 0, CAPABILITIES) != LC_OK ||
@@ -70,11 +70,11 @@ static bool append_registrations(bn_request_msg *msg, const state_source &source
     return true;
 }
 
-static bool within(const node_name &name, const node_name &root) {
+bool is_at_or_under(const node_name &name, const node_name &root) {
     return name == root || name.is_under(root);
 }
 
-static daemon_part *part_for(std::vector<daemon_part> *parts, size_t source) {
+daemon_part *find_part(std::vector<daemon_part> *parts, size_t source) {
     for (daemon_part &part : *parts)
         if (part.source == source)
             return &part;
@@ -83,16 +83,16 @@ static daemon_part *part_for(std::vector<daemon_part> *parts, size_t source) {
 }
 
 // Which of the node's answers come from a daemon.
-static void plan_node(std::vector<daemon_part> *parts, const asked_node &asked, const node_name &name) {
+void plan_node(std::vector<daemon_part> *parts, const asked_node &asked, const node_name &name) {
     const bool subtree = asked.subop == bn_query_iterate && (asked.flags & bn_qf_subtree);
-    for (size_t source = 0; source < std::size(sources); source++)
-        for (const char *text : sources[source].roots) {
+    for (size_t source = 0; source < std::size(state_sources); source++)
+        for (const char *text : state_sources[source].roots) {
             const node_name root = parsed_name(text);
-            const bool by_name = within(name, root);
+            const bool by_name = is_at_or_under(name, root);
             if (!by_name && !(subtree && root.is_under(name)))
                 continue;
             const asked_node node = {asked.id, asked.subop, asked.flags, by_name ? name.text() : text};
-            daemon_part *part = part_for(parts, source);
+            daemon_part *part = find_part(parts, source);
             part->whole |= by_name;
             (subtree && node.name == NODE_GROUP_STATE ? part->walks : part->nodes).push_back(node);
             if (by_name)
@@ -100,8 +100,8 @@ static void plan_node(std::vector<daemon_part> *parts, const asked_node &asked, 
         }
 }
 
-static void answer_here(const server *self, uint32_t subop, uint32_t flags, const node_name &name,
-                        node_list *out) {
+void collect_own_nodes(const server *self, uint32_t subop, uint32_t flags, const node_name &name,
+                       node_list *out) {
     for (const node_map *nodes : {&self->tree.nodes, &self->state}) {
         if (subop == bn_query_get) {
             if (const auto found = nodes->find(name); found != nodes->end())
@@ -115,26 +115,26 @@ static void answer_here(const server *self, uint32_t subop, uint32_t flags, cons
     }
 }
 
-static bool append_answer(bn_response_msg *response, uint32_t node_id, const std::string &name,
-                          const node_value &value) {
+bool append_answer(bn_response_msg *response, uint32_t node_id, const std::string &name,
+                   const node_value &value) {
     owned_binding binding(make_binding(name, value));
     return binding.pointer &&
            bn_query_response_msg_append_binding_takeover(response, &binding.pointer, node_id) == LC_OK;
 }
 
-static void refuse_query(server *self, const pending_query &query, uint32_t code, const std::string &why) {
+void refuse_query(server *self, const pending_query &query, uint32_t code, const std::string &why) {
     owned_response response;
     if (bn_query_response_msg_create(&response.pointer, query.asker_message_id, code, why.c_str()) == LC_OK)
         (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
 }
 
-static bool is_shown_all(const server *self, uint32_t asker) {
+bool is_shown_all(const server *self, uint32_t asker) {
     const auto found = self->peers.find(asker);
     return found != self->peers.end() && found->second.owner.may_change;
 }
 
 // What mgmtd answers itself. False when that is more than a message holds: the query has been refused.
-static bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
+bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
     size_t bytes = query.gathered_bytes;
     const auto asker = self->peers.find(query.asker);
     const bool runs_groups = asker != self->peers.end() && server_runs_groups(asker->second);
@@ -156,7 +156,7 @@ static bool append_own_answers(server *self, const pending_query &query, bn_resp
         node_value made;
         if (!parse_node_name(asked.name, &name))
             continue;
-        answer_here(self, asked.subop, asked.flags, name, &found);
+        collect_own_nodes(self, asked.subop, asked.flags, name, &found);
         for (const auto *entry : found)
             if (!append(asked.id, entry->first,
                         runs_groups ? server_value_for_wccpd(self, entry->first, entry->second)
@@ -169,7 +169,7 @@ static bool append_own_answers(server *self, const pending_query &query, bn_resp
     return true;
 }
 
-static std::vector<asked_node> nodes_asked_for(const bn_request_msg *msg) {
+std::vector<asked_node> read_asked_nodes(const bn_request_msg *msg) {
     std::vector<asked_node> out;
     const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
     out.reserve(count);
@@ -180,6 +180,8 @@ static std::vector<asked_node> nodes_asked_for(const bn_request_msg *msg) {
     return out;
 }
 
+} // namespace
+
 pending_query server_take_pending(server *self, std::map<uint32_t, pending_query>::iterator at) {
     pending_query out = std::move(at->second);
     self->pending_bytes -= out.bytes;
@@ -188,7 +190,9 @@ pending_query server_take_pending(server *self, std::map<uint32_t, pending_query
     return out;
 }
 
-static bool may_wait(const server *self, const pending_query &query) {
+namespace {
+
+bool may_wait(const server *self, const pending_query &query) {
     const auto of_asker = std::count_if(self->pending.begin(), self->pending.end(),
                                         [&](const auto &each) { return each.second.asker == query.asker; });
     return of_asker < static_cast<ptrdiff_t>(PENDING_SESSION_MAX) && self->pending.size() < PENDING_MAX &&
@@ -196,8 +200,8 @@ static bool may_wait(const server *self, const pending_query &query) {
 }
 
 // The request to the daemon; `query` gets the numbers of its nodes. Null when it can't be made.
-static bn_request_msg *make_forwarded(const state_source &source, const std::vector<asked_node> &nodes,
-                                      bool list_groups, pending_query *query) {
+bn_request_msg *make_forwarded(const state_source &source, const std::vector<asked_node> &nodes,
+                               bool list_groups, pending_query *query) {
     owned_request msg;
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK ||
         !append_registrations(msg.pointer, source))
@@ -218,8 +222,8 @@ static bn_request_msg *make_forwarded(const state_source &source, const std::vec
 }
 
 // 0 when the query waits for what the daemon answers about these nodes.
-static uint32_t forward(server *self, const std::vector<asked_node> &nodes, bool list_groups,
-                        pending_query query) {
+uint32_t forward_query(server *self, const std::vector<asked_node> &nodes, bool list_groups,
+                       pending_query query) {
     query.bytes = 0;
     for (const asked_node &node : query.asked)
         query.bytes += node.name.size() + PENDING_NODE_BYTES;
@@ -228,7 +232,7 @@ static uint32_t forward(server *self, const std::vector<asked_node> &nodes, bool
     if (!may_wait(self, query))
         return LC_NO_SPACE;
     const owned_request msg(
-        make_forwarded(sources[query.parts[query.next_part - 1].source], nodes, list_groups, &query));
+        make_forwarded(state_sources[query.parts[query.next_part - 1].source], nodes, list_groups, &query));
     if (!msg.pointer)
         return LC_IO_CLOSED;
     const uint32_t id = msg.pointer->msg_id = self->next_query_id++, provider = query.provider;
@@ -242,13 +246,13 @@ static uint32_t forward(server *self, const std::vector<asked_node> &nodes, bool
     return LC_IO_CLOSED;
 }
 
-static bool is_limit(uint32_t code) {
+bool is_limit(uint32_t code) {
     return code == LC_NO_SPACE || code == LC_NO_BUFFER_SPACE;
 }
 
 // Sends what mgmtd answers itself and what the daemons have answered. A limit that was met is reported to
 // every asker, and leaves no room for anything else.
-static void finish_query(server *self, const pending_query &query, uint32_t code, const std::string &words) {
+void finish_query(server *self, const pending_query &query, uint32_t code, const std::string &words) {
     if (is_limit(code)) {
         refuse_query(self, query, code, words);
         return;
@@ -266,11 +270,11 @@ static void finish_query(server *self, const pending_query &query, uint32_t code
     (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
 }
 
-static void ask_next(server *self, pending_query query);
+void ask_next(server *self, pending_query query);
 
 // The daemon under way has answered all, or failed. A failure is reported to those who asked for its nodes by
 // name; to others it is nothing.
-static void end_part(server *self, pending_query query, uint32_t code, const std::string &words) {
+void end_part(server *self, pending_query query, uint32_t code, const std::string &words) {
     const bool whole = query.next_part > 0 && query.parts[query.next_part - 1].whole;
     if (is_limit(code) || (code != LC_OK && whole))
         finish_query(self, query, code, words);
@@ -278,13 +282,13 @@ static void end_part(server *self, pending_query query, uint32_t code, const std
         ask_next(self, std::move(query));
 }
 
-static void fail_to_ask(server *self, pending_query query, uint32_t code) {
-    const std::string daemon = sources[query.parts[query.next_part - 1].source].client;
+void fail_to_ask(server *self, pending_query query, uint32_t code) {
+    const std::string daemon = state_sources[query.parts[query.next_part - 1].source].client;
     end_part(self, std::move(query), code,
              code == LC_NO_SPACE ? "Too many queries wait for " + daemon : daemon + " has no session");
 }
 
-static void ask_next(server *self, pending_query query) {
+void ask_next(server *self, pending_query query) {
     if (query.next_part == query.parts.size()) {
         finish_query(self, query, LC_OK, "");
         return;
@@ -292,19 +296,21 @@ static void ask_next(server *self, pending_query query) {
     const daemon_part part = query.parts[query.next_part++];
     query.groups.clear();
     query.next_group = 0;
-    query.provider = find_provider(self, sources[part.source], query.asker);
+    query.provider = find_provider(self, state_sources[part.source], query.asker);
     const uint32_t code =
-        query.provider ? forward(self, part.nodes, !part.walks.empty(), query) : uint32_t{LC_IO_CLOSED};
+        query.provider ? forward_query(self, part.nodes, !part.walks.empty(), query) : uint32_t{LC_IO_CLOSED};
     if (code != LC_OK)
         fail_to_ask(self, std::move(query), code);
 }
+
+} // namespace
 
 void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
     pending_query query = {};
     query.asker = peer_id;
     query.asker_message_id = msg->msg_id;
     query.asker_transaction_id = msg->transaction_id;
-    query.asked = nodes_asked_for(msg);
+    query.asked = read_asked_nodes(msg);
     for (const asked_node &node : query.asked)
         if (node_name name; parse_node_name(node.name, &name))
             plan_node(&query.parts, node, name);
@@ -320,8 +326,10 @@ void server_answer_without(server *self, pending_query query, uint32_t code, con
     end_part(self, std::move(query), code, why);
 }
 
+namespace {
+
 // A dump of wccpd's has passwords in it. One that can't be made anew is left out.
-static void hide_in(bn_binding **inout) {
+void hide_passwords_in(bn_binding **inout) {
     const std::string name = name_of(*inout);
     const node_value value = value_of(*inout);
     const std::string hidden = hidden_value(name, value.text);
@@ -332,7 +340,7 @@ static void hide_in(bn_binding **inout) {
 }
 
 // Takes over the daemon's bindings. False when a limit is met: the query has been refused.
-static bool gather(server *self, pending_query *query, bn_response_msg *msg, size_t bytes) {
+bool gather_answer(server *self, pending_query *query, bn_response_msg *msg, size_t bytes) {
     query->gathered_bytes += bytes;
     if (query->gathered_bytes > GCL_FRAME_MAX) {
         refuse_query(self, *query, LC_NO_BUFFER_SPACE, BN_TOO_LARGE);
@@ -352,7 +360,7 @@ static bool gather(server *self, pending_query *query, bn_response_msg *msg, siz
         if (!node || !node->binding)
             continue;
         if (!all)
-            hide_in(&node->binding);
+            hide_passwords_in(&node->binding);
         const auto asked = query->node_ids.find(node->node_id);
         if (asked != query->node_ids.end())
             (void)bn_query_response_msg_append_binding_takeover(query->gathered.get(), &node->binding,
@@ -363,12 +371,14 @@ static bool gather(server *self, pending_query *query, bn_response_msg *msg, siz
     return true;
 }
 
+} // namespace
+
 void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg, size_t bytes) {
     const auto found = self->pending.find(msg->response_to);
     if (found == self->pending.end() || found->second.provider != peer_id)
         return; // too late, or never asked for
     pending_query query = server_take_pending(self, found);
-    if (!gather(self, &query, msg, bytes))
+    if (!gather_answer(self, &query, msg, bytes))
         return;
     if (msg->return_code != LC_OK || query.next_group == query.groups.size()) {
         end_part(self, std::move(query), msg->return_code,
@@ -381,7 +391,7 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
         node.flags |= bn_qf_include_self;
     }
     query.next_group++;
-    const uint32_t code = forward(self, nodes, false, query);
+    const uint32_t code = forward_query(self, nodes, false, query);
     if (code != LC_OK)
         fail_to_ask(self, std::move(query), code);
 }

@@ -17,10 +17,14 @@
 #include "peers/nodes/schema.h"
 #include "runtime/ttime.h"
 
+namespace {
+
 // Of what a report says, as much is kept as a person reads; with ALARMS_MAX of them a walk still fits in one
 // message.
-static constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
-static constexpr uint32_t OWN_REPORTS = 0; // instead of a session: those of mgmtd itself
+constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
+constexpr uint32_t OWN_REPORTS = 0; // instead of a session: those of mgmtd itself
+
+} // namespace
 
 node_value server_time_now() {
     owned_text text;
@@ -37,33 +41,35 @@ void server_remove_report(server *self, const node_name &root) {
         at = self->state.erase(at);
 }
 
-static bool keep_report(server *self, uint32_t peer_id, const node_name &root) {
+namespace {
+
+bool claim_report(server *self, uint32_t peer_id, const node_name &root) {
     if (!self->alarm_owners.contains(root) && self->alarm_owners.size() >= ALARMS_MAX)
         return false;
     self->alarm_owners[root] = peer_id;
     return true;
 }
 
-static std::string text_or(const std::vector<event_field> &fields, const char *name, const char *otherwise,
-                           size_t most = SOURCE_MAX) {
+std::string read_text_field(const std::vector<event_field> &fields, const char *name, const char *otherwise,
+                            size_t most = SOURCE_MAX) {
     const std::string *text = find_field(fields, name);
     return text && !text->empty() ? text->substr(0, most) : otherwise;
 }
 
-static node_name alarm_root(const std::vector<event_field> &fields) {
+node_name find_alarm_root(const std::vector<event_field> &fields) {
     return parsed_name(NODE_ALARMS_RAISED)
-        .below(text_or(fields, "alarm_type", "0"))
-        .below(text_or(fields, "param_3", "-"));
+        .below(read_text_field(fields, "alarm_type", "0"))
+        .below(read_text_field(fields, "param_3", "-"));
 }
 
-static void keep_alarm(server *self, uint32_t peer_id, const std::string &reporter,
-                       const std::vector<event_field> &fields) {
-    const node_name root = alarm_root(fields);
-    if (!keep_report(self, peer_id, root)) {
+void keep_alarm(server *self, uint32_t peer_id, const std::string &reporter,
+                const std::vector<event_field> &fields) {
+    const node_name root = find_alarm_root(fields);
+    if (!claim_report(self, peer_id, root)) {
         self->say("alarm lost, too many are active: " + root.text());
         return;
     }
-    const std::string comment = text_or(fields, "comment", "", TEXT_MAX);
+    const std::string comment = read_text_field(fields, "comment", "", TEXT_MAX);
     self->state[root] = {bn_type_str, comment};
     self->state[root.below("name")] = {bn_type_str, alarm_name(root.parts[root.parts.size() - 2])};
     self->state[root.below("since")] = server_time_now();
@@ -71,23 +77,23 @@ static void keep_alarm(server *self, uint32_t peer_id, const std::string &report
     self->say("alarm raised: " + root.parts.back() + " " + comment);
 }
 
-static void take_raise(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+void take_raised_alarm(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     keep_alarm(self, peer_id, self->peers[peer_id].name, fields);
 }
 
-static void take_clear(server *self, uint32_t, const std::vector<event_field> &fields) {
-    const node_name root = alarm_root(fields);
+void take_cleared_alarm(server *self, uint32_t, const std::vector<event_field> &fields) {
+    const node_name root = find_alarm_root(fields);
     server_remove_report(self, root);
-    self->say("alarm cleared: " + root.parts.back() + " " + text_or(fields, "comment", "", TEXT_MAX));
+    self->say("alarm cleared: " + root.parts.back() + " " + read_text_field(fields, "comment", "", TEXT_MAX));
 }
 
-static void take_role(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
-    const node_name root = parsed_name(NODE_ROLES).below(text_or(fields, "group", "-"));
-    if (!keep_report(self, peer_id, root))
+void take_role(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+    const node_name root = parsed_name(NODE_ROLES).below(read_text_field(fields, "group", "-"));
+    if (!claim_report(self, peer_id, root))
         return;
-    const char *role = role_name(text_or(fields, "role", ""));
+    const char *role = role_name(read_text_field(fields, "role", ""));
     std::string code;
-    if (!canonical_text(bn_type_uint32, text_or(fields, "code", "0"), &code))
+    if (!canonical_text(bn_type_uint32, read_text_field(fields, "code", "0"), &code))
         code = "0";
     self->state[root] = {bn_type_str, role};
     self->state[root.below("code")] = {bn_type_uint32, code};
@@ -95,13 +101,13 @@ static void take_role(server *self, uint32_t peer_id, const std::vector<event_fi
     self->say("role of group " + root.parts.back() + ": " + role);
 }
 
-static const struct {
+const struct {
     const char *event;
     void (*take)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
     bool repeated = false; // also sent without a change: `take` passes on what is one
 } reports[] = {
-    {EVENT_RAISE_ALARM, take_raise},
-    {EVENT_CLEAR_ALARM, take_clear},
+    {EVENT_RAISE_ALARM, take_raised_alarm},
+    {EVENT_CLEAR_ALARM, take_cleared_alarm},
     {EVENT_ROLE_CHANGE, take_role},
     {EVENT_GROUP_LEAVE, server_take_leave, true},
     {EVENT_GROUP_JOIN, server_take_join, true},
@@ -109,6 +115,8 @@ static const struct {
     {EVENT_GROUP_WEIGHT, server_take_weight, true},
     {EVENT_DRAIN_PROGRESS, server_take_drain_progress, true},
 };
+
+} // namespace
 
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,
                        const std::vector<event_field> &fields) {
@@ -124,7 +132,8 @@ void server_take_event(server *self, uint32_t peer_id, const std::string &event,
 
 void server_raise_own_alarm(server *self, const std::vector<event_field> &fields, bool is_news) {
     if (!is_news) {
-        self->state[alarm_root(fields)] = {bn_type_str, text_or(fields, "comment", "", TEXT_MAX)};
+        self->state[find_alarm_root(fields)] = {bn_type_str,
+                                                read_text_field(fields, "comment", "", TEXT_MAX)};
         return;
     }
     keep_alarm(self, OWN_REPORTS, "mgmtd", fields);
@@ -132,12 +141,14 @@ void server_raise_own_alarm(server *self, const std::vector<event_field> &fields
 }
 
 void server_clear_own_alarm(server *self, const std::vector<event_field> &fields) {
-    take_clear(self, OWN_REPORTS, fields);
+    take_cleared_alarm(self, OWN_REPORTS, fields);
     server_send_event(self, EVENT_CLEAR_ALARM, fields);
 }
 
+namespace {
+
 // What watchers get instead of the report that a daemon which is gone cannot send.
-static void report_forgotten(server *self, const node_name &root) {
+void report_forgotten(server *self, const node_name &root) {
     const std::string &last = root.parts.back();
     if (root.is_under(parsed_name(NODE_ROLES)))
         server_send_event(self, EVENT_ROLE_CHANGE,
@@ -152,6 +163,8 @@ static void report_forgotten(server *self, const node_name &root) {
                            {"param_3", {bn_type_str, last}},
                            {"comment", {bn_type_str, "forgotten with the session of its reporter"}}});
 }
+
+} // namespace
 
 void server_forget_reports(server *self, uint32_t peer_id) {
     std::vector<node_name> gone;

@@ -7,9 +7,13 @@
 
 #include "mgmt/node_paths.h"
 
-static uint32_t host_order(const sockaddr *address) {
+namespace {
+
+uint32_t read_host_order(const sockaddr *address) {
     return ntohl(reinterpret_cast<const sockaddr_in *>(address)->sin_addr.s_addr);
 }
+
+} // namespace
 
 std::vector<local_address> find_local_addresses() {
     std::vector<local_address> out;
@@ -20,19 +24,21 @@ std::vector<local_address> find_local_addresses() {
     for (const ifaddrs *at = first; at; at = at->ifa_next) {
         if (!at->ifa_addr || at->ifa_addr->sa_family != AF_INET)
             continue;
-        const uint32_t address = host_order(at->ifa_addr);
-        const uint32_t hosts = at->ifa_netmask ? ~host_order(at->ifa_netmask) : 0;
+        const uint32_t address = read_host_order(at->ifa_addr);
+        const uint32_t hosts = at->ifa_netmask ? ~read_host_order(at->ifa_netmask) : 0;
         out.push_back({address, hosts > 1 ? address | hosts : 0});
     }
     return out;
 }
 
-static bool is_multicast(uint32_t address) {
+namespace {
+
+bool is_multicast(uint32_t address) {
     return address >> 28 == 0xe;
 }
 
 // Why it is no router's address; null when it may be one.
-static const char *fault_of(uint32_t address, size_t routers, const std::vector<local_address> &local) {
+const char *find_fault(uint32_t address, size_t routers, const std::vector<local_address> &local) {
     if (is_multicast(address))
         return routers > 1 ? "is a multicast address, which must be the only router of its group" : nullptr;
     if (address >> 24 == 127)
@@ -48,13 +54,13 @@ static const char *fault_of(uint32_t address, size_t routers, const std::vector<
     return nullptr;
 }
 
-static node_list routers_of(const node_tree &tree, const node_name &group) {
+node_list collect_routers(const node_tree &tree, const node_name &group) {
     node_list out;
     collect_nodes(tree.nodes, group.below("router"), {true, false, true}, &out);
     return out;
 }
 
-static bool same_routers(const node_list &a, const node_list &b) {
+bool are_same_routers(const node_list &a, const node_list &b) {
     if (a.size() != b.size())
         return false;
     for (size_t i = 0; i < a.size(); i++)
@@ -63,6 +69,8 @@ static bool same_routers(const node_list &a, const node_list &b) {
     return true;
 }
 
+} // namespace
+
 std::vector<std::string> find_bad_routers(const node_tree &tree, const node_tree *before,
                                           const std::vector<local_address> &local) {
     static const node_name groups = parsed_name(NODE_GROUP_CONFIG);
@@ -70,13 +78,13 @@ std::vector<std::string> find_bad_routers(const node_tree &tree, const node_tree
     node_list roots;
     collect_nodes(tree.nodes, groups, {false, false, false}, &roots);
     for (const auto *root : roots) {
-        const node_list routers = routers_of(tree, root->first);
-        if (before && same_routers(routers, routers_of(*before, root->first)))
+        const node_list routers = collect_routers(tree, root->first);
+        if (before && are_same_routers(routers, collect_routers(*before, root->first)))
             continue;
         for (const auto *router : routers) {
             in_addr address = {};
             (void)inet_pton(AF_INET, router->second.text.c_str(), &address);
-            if (const char *fault = fault_of(ntohl(address.s_addr), routers.size(), local))
+            if (const char *fault = find_fault(ntohl(address.s_addr), routers.size(), local))
                 out.push_back(router->first.text() + ": " + router->second.text + " " + fault);
         }
     }

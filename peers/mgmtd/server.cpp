@@ -15,7 +15,11 @@
 #include "mgmt/gcl.h"
 #include "mgmt/node_paths.h"
 
-static constexpr uint16_t SERVICE = 2;
+namespace {
+
+constexpr uint16_t SERVICE = 2;
+
+} // namespace
 
 // --- Sending
 
@@ -39,8 +43,10 @@ bool server_send_request(server *self, uint32_t peer_id, bn_request_msg *msg) {
     return true;
 }
 
+namespace {
+
 // A response without bindings instead of one that doesn't fit, whose bytes are freed.
-static tbuffer *refusal_of(const bn_response_msg *msg, const char *words, tbuffer *unsent) {
+tbuffer *make_refusal(const bn_response_msg *msg, const char *words, tbuffer *unsent) {
     tb_free(&unsent);
     owned_response refusal;
     if (bn_response_msg_create(&refusal.pointer, msg->msg_type, msg->response_to, LC_NO_BUFFER_SPACE,
@@ -54,6 +60,8 @@ static tbuffer *refusal_of(const bn_response_msg *msg, const char *words, tbuffe
     return frame;
 }
 
+} // namespace
+
 bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, uint32_t transaction_id) {
     const auto found = self->peers.find(peer_id);
     if (!msg || found == self->peers.end())
@@ -65,10 +73,10 @@ bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, 
     owned_tbuffer frame;
     if (bn_response_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &frame.pointer) != LC_OK ||
         frame.pointer->length > GCL_FRAME_MAX) {
-        frame.pointer = refusal_of(msg, BN_TOO_LARGE, frame.take());
+        frame.pointer = make_refusal(msg, BN_TOO_LARGE, frame.take());
     } else if (self->fits && !self->fits(peer_id, frame.pointer->length)) {
         frame.pointer =
-            refusal_of(msg, "Too much waits for you to read it: ask for less, or later", frame.take());
+            make_refusal(msg, "Too much waits for you to read it: ask for less, or later", frame.take());
     }
     if (!frame.pointer)
         return false;
@@ -76,23 +84,27 @@ bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, 
     return true;
 }
 
-static void answer(server *self, uint32_t peer_id, const bn_request_msg *request, uint32_t code,
-                   const std::string &message) {
+namespace {
+
+void send_answer(server *self, uint32_t peer_id, const bn_request_msg *request, uint32_t code,
+                 const std::string &message) {
     owned_response response;
     if (bn_response_msg_create(&response.pointer, bn_request_msg_response_msg_type(request->msg_type),
                                request->msg_id, code, message.c_str()) == LC_OK)
         (void)server_send_response(self, peer_id, response.pointer, request->transaction_id);
 }
 
-static bool wants(const peer &who, const std::string &event) {
+bool wants_event(const peer &who, const std::string &event) {
     return std::any_of(who.interests.begin(), who.interests.end(),
                        [&](const interest &wish) { return wish.event == event; });
 }
 
+} // namespace
+
 void server_send_event(server *self, const std::string &event, const std::vector<event_field> &fields) {
     std::vector<uint32_t> ids;
     for (const auto &[id, who] : self->peers)
-        if (wants(who, event))
+        if (wants_event(who, event))
             ids.push_back(id);
     for (const uint32_t id : ids) {
         const owned_request msg(make_event(event, fields));
@@ -112,25 +124,27 @@ struct action_answer {
     std::string message;
 };
 
-static size_t text_bytes(const interest &wish) {
+namespace {
+
+size_t count_interest_bytes(const interest &wish) {
     size_t bytes = wish.event.size();
     for (const std::string &pattern : wish.patterns)
         bytes += pattern.size() + sizeof(std::string);
     return bytes;
 }
 
-static bool may_add_interest(const peer &who, const interest &wish) {
-    size_t count = 1, bytes = text_bytes(wish);
+bool may_add_interest(const peer &who, const interest &wish) {
+    size_t count = 1, bytes = count_interest_bytes(wish);
     for (const interest &old : who.interests)
         if (old.event != wish.event) {
             count++;
-            bytes += text_bytes(old);
+            bytes += count_interest_bytes(old);
         }
     return count <= INTERESTS_MAX && bytes <= INTEREST_BYTES_MAX;
 }
 
 // "match/N/pattern" in the order of N; the order doesn't matter to a match.
-static action_answer add_interest(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+action_answer add_interest(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     interest wish;
     for (const event_field &field : fields) {
         const std::string &name = field.name;
@@ -155,7 +169,7 @@ static action_answer add_interest(server *self, uint32_t peer_id, const std::vec
     return {};
 }
 
-static action_answer remove_interest(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
+action_answer remove_interest(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     const std::string *event = find_field(fields, "event_name");
     if (!event || std::erase_if(self->peers[peer_id].interests,
                                 [&](const interest &old) { return old.event == *event; }) == 0)
@@ -164,7 +178,7 @@ static action_answer remove_interest(server *self, uint32_t peer_id, const std::
 }
 
 // What happened to a process, reported by whoever started it, or at its end by itself.
-static action_answer report_process(server *self, uint32_t, const std::vector<event_field> &fields) {
+action_answer report_process(server *self, uint32_t, const std::vector<event_field> &fields) {
     static const std::map<std::string, const char *> events = {
         {"crash", EVENT_PROCESS_CRASH},
         {"unexpected_exit", EVENT_PROCESS_EXIT},
@@ -181,72 +195,72 @@ static action_answer report_process(server *self, uint32_t, const std::vector<ev
     return {};
 }
 
-static action_answer report_zone(server *self, uint32_t, const std::vector<event_field> &) {
+action_answer report_time_zone(server *self, uint32_t, const std::vector<event_field> &) {
     self->say("time zone changed");
     server_send_event(self, EVENT_TIME_ZONE, {});
     return {};
 }
 
-static action_answer confirm(server *self, uint32_t peer_id, const std::vector<event_field> &) {
+action_answer confirm_commit(server *self, uint32_t peer_id, const std::vector<event_field> &) {
     const commit_result result = server_confirm(self, self->peers[peer_id].name);
     return {result.code, result.message};
 }
 
 template <uint32_t (*Run)(server *, const std::vector<event_field> &, std::string *)>
-static action_answer run_action(server *self, uint32_t, const std::vector<event_field> &fields) {
+action_answer run_action(server *self, uint32_t, const std::vector<event_field> &fields) {
     action_answer out{};
     out.code = Run(self, fields, &out.message);
     return out;
 }
 
-static const struct {
+const struct {
     const char *name;
     action_answer (*run)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
     bool looks = false; // changes nothing
 } actions[] = {
     {ACTION_ADD_INTEREST, add_interest, true},
     {ACTION_REMOVE_INTEREST, remove_interest, true},
-    {ACTION_CONFIRM, confirm},
+    {ACTION_CONFIRM, confirm_commit},
     {ACTION_REPORT_PROCESS, report_process},
-    {"/mgmtd/time/actions/zonechange", report_zone},
+    {"/mgmtd/time/actions/zonechange", report_time_zone},
     {ACTION_DRAIN, run_action<server_begin_drain>},
     {ACTION_DRAIN_CANCEL, run_action<server_cancel_drain>},
 };
 
-static std::string text_of(const tstring *text) {
+std::string read_text(const tstring *text) {
     return text ? ts_str(text) : "";
 }
 
 // True when the session may change things; otherwise the request has been answered.
-static bool may_change(server *self, uint32_t peer_id, const bn_request_msg *msg) {
+bool may_change(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     const peer_owner &owner = self->peers[peer_id].owner;
     if (!owner.may_change)
-        answer(self, peer_id, msg, LC_BAD_LOGIN, owner.user + " may look, but not change anything");
+        send_answer(self, peer_id, msg, LC_BAD_LOGIN, owner.user + " may look, but not change anything");
     return owner.may_change;
 }
 
-static void take_action(server *self, uint32_t peer_id, const bn_request_msg *msg) {
-    const std::string name = text_of(msg->text);
+void take_action(server *self, uint32_t peer_id, const bn_request_msg *msg) {
+    const std::string name = read_text(msg->text);
     for (const auto &action : actions)
         if (name == action.name) {
             if (!action.looks && !may_change(self, peer_id, msg))
                 return;
             const action_answer result = action.run(self, peer_id, fields_of(msg));
-            answer(self, peer_id, msg, result.code, result.message);
+            send_answer(self, peer_id, msg, result.code, result.message);
             return;
         }
-    answer(self, peer_id, msg, LC_NOT_FOUND, "No such action: " + name);
+    send_answer(self, peer_id, msg, LC_NOT_FOUND, "No such action: " + name);
 }
 
 // --- Changes of the configuration
 
-static commit_order order_of(const peer &who, const bn_request_msg *msg) {
+commit_order read_commit_order(const peer &who, const bn_request_msg *msg) {
     commit_order order;
     order.who = who.name;
     order.user = who.owner.user;
-    if (const std::string person = text_of(msg->audit_user); !person.empty())
+    if (const std::string person = read_text(msg->audit_user); !person.empty())
         order.user += " (" + person + ")";
-    order.cause = text_of(msg->text);
+    order.cause = read_text(msg->text);
     if (order.cause.empty())
         order.cause = who.name;
     order.check_only = msg->flags & bn_cf_check_only;
@@ -256,13 +270,14 @@ static commit_order order_of(const peer &who, const bn_request_msg *msg) {
     return order;
 }
 
-static void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
+void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     constexpr uint32_t known = bn_cf_check_only | bn_cf_ends_wait | ~0u << bn_cf_minutes_shift;
     std::vector<set_step> steps;
     if (!may_change(self, peer_id, msg))
         return;
     if (msg->flags & ~known) {
-        answer(self, peer_id, msg, LC_NOT_IMPLEMENTED, "The request has commit flags that are not known");
+        send_answer(self, peer_id, msg, LC_NOT_IMPLEMENTED,
+                    "The request has commit flags that are not known");
         return;
     }
     const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
@@ -278,15 +293,17 @@ static void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) 
         else if (node->subop == bn_set_delete || node->subop == bn_set_reset)
             step.kind = set_kind::remove;
         else if (node->subop != bn_set_modify) {
-            answer(self, peer_id, msg, LC_NOT_IMPLEMENTED,
-                   step.name + ": nodes are created, modified, reset and deleted only");
+            send_answer(self, peer_id, msg, LC_NOT_IMPLEMENTED,
+                        step.name + ": nodes are created, modified, reset and deleted only");
             return;
         }
         steps.push_back(std::move(step));
     }
-    const commit_result result = server_commit(self, steps, order_of(self->peers[peer_id], msg));
-    answer(self, peer_id, msg, result.code, result.message);
+    const commit_result result = server_commit(self, steps, read_commit_order(self->peers[peer_id], msg));
+    send_answer(self, peer_id, msg, result.code, result.message);
 }
+
+} // namespace
 
 // --- Sessions and their messages
 
@@ -326,7 +343,9 @@ void server_peer_closed(server *self, uint32_t peer_id) {
     server_orphan_weights(self, peer_id);
 }
 
-static void answer_late_queries(server *self) {
+namespace {
+
+void answer_late_queries(server *self) {
     const int64_t now = self->now_ms();
     std::vector<pending_query> late;
     for (auto at = self->pending.begin(); at != self->pending.end();) {
@@ -342,36 +361,35 @@ static void answer_late_queries(server *self) {
     }
 }
 
-static void take_earlier(int64_t *inout, int64_t at_ms) {
-    if (at_ms >= 0 && (*inout < 0 || at_ms < *inout))
-        *inout = at_ms;
-}
+} // namespace
 
 int64_t server_tick(server *self) {
     int64_t next = -1;
     answer_late_queries(self);
-    take_earlier(&next, server_drop_left_groups(self));
-    take_earlier(&next, server_return_unconfirmed(self));
-    take_earlier(&next, server_end_drains(self));
-    take_earlier(&next, server_expire_bypasses(self));
-    take_earlier(&next, server_clear_restart_alarms(self));
+    keep_earlier(&next, server_drop_left_groups(self));
+    keep_earlier(&next, server_return_unconfirmed(self));
+    keep_earlier(&next, server_end_drains(self));
+    keep_earlier(&next, server_expire_bypasses(self));
+    keep_earlier(&next, server_clear_restart_alarms(self));
     for (const auto &[id, query] : self->pending) // also those that have gone on to another daemon
-        take_earlier(&next, query.deadline_ms);
+        keep_earlier(&next, query.deadline_ms);
     return next;
 }
 
-// Of an action or event: all of them are copied, and those of a report are sent on.
-static constexpr uint32_t FIELDS_MAX = 1024;
+namespace {
 
-static bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
+// Of an action or event: all of them are copied, and those of a report are sent on.
+constexpr uint32_t FIELDS_MAX = 1024;
+
+bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
     owned_request msg;
     if (bn_request_msg_deserialize(frame, BN_FRAME_HEADER_BYTES, &msg.pointer) != LC_OK ||
         msg.pointer->msg_type != mtype)
         return false;
     const bool has_fields = mtype == bn_msg_action_request || mtype == bn_msg_event;
     if (has_fields && bn_request_per_node_array_length_quick(msg.pointer->nodes) > FIELDS_MAX) {
-        answer(self, peer_id, msg.pointer, LC_BAD_ARGUMENT,
-               "more than " + std::to_string(FIELDS_MAX) + " fields");
+        send_answer(self, peer_id, msg.pointer, LC_BAD_ARGUMENT,
+                    "more than " + std::to_string(FIELDS_MAX) + " fields");
         return true;
     }
     switch (mtype) {
@@ -387,13 +405,15 @@ static bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const t
     case bn_msg_event:
         if (!may_change(self, peer_id, msg.pointer))
             return true;
-        server_take_event(self, peer_id, text_of(msg.pointer->text), fields_of(msg.pointer));
-        answer(self, peer_id, msg.pointer, 0, "");
+        server_take_event(self, peer_id, read_text(msg.pointer->text), fields_of(msg.pointer));
+        send_answer(self, peer_id, msg.pointer, 0, "");
         return true;
     default:
         return false;
     }
 }
+
+} // namespace
 
 bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
     if (!self->peers.contains(peer_id) || mtype < bn_msg_query_request || mtype > bn_msg_event_ack)

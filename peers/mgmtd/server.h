@@ -174,6 +174,11 @@ void server_begin(server *self);
 void server_reload(server *self);
 
 // The parts of it, for each other.
+// The earlier of two times, of which -1 is none.
+inline void keep_earlier(int64_t *inout, int64_t at_ms) {
+    if (at_ms >= 0 && (*inout < 0 || at_ms < *inout))
+        *inout = at_ms;
+}
 bool server_send_request(server *self, uint32_t peer_id, bn_request_msg *msg);
 bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, uint32_t transaction_id);
 void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg);

@@ -55,12 +55,14 @@ const char *end_event(int wait_status, bool ending) {
     return WIFSIGNALED(wait_status) ? EVENT_PROCESS_CRASH : EVENT_PROCESS_EXIT;
 }
 
-static std::string end_text(int wait_status) {
+namespace {
+
+std::string end_text(int wait_status) {
     return WIFSIGNALED(wait_status) ? std::string("ended by ") + lc_signal_num_to_name(WTERMSIG(wait_status))
                                     : "exited with " + std::to_string(WEXITSTATUS(wait_status));
 }
 
-[[noreturn]] static void become(const std::vector<std::string> &command, pid_t parent, int lock) {
+[[noreturn]] void exec_child(const std::vector<std::string> &command, pid_t parent, int lock) {
     prctl(PR_SET_PDEATHSIG, SIGTERM);
     if (getppid() != parent)
         _exit(127);
@@ -82,12 +84,12 @@ static std::string end_text(int wait_status) {
 }
 
 // Null, or the step that failed, with errno.
-static const char *fork_child(child *process) {
+const char *fork_child(child *process) {
     const pid_t parent = getpid();
     signal(SIGCHLD, SIG_DFL); // ignored, a child would be gone with its status before anybody looks
     const pid_t pid = fork();
     if (pid == 0)
-        become(process->command, parent, process->lock);
+        exec_child(process->command, parent, process->lock);
     if (pid < 0)
         return "fork";
     process->pid = pid;
@@ -103,7 +105,7 @@ static const char *fork_child(child *process) {
 
 // False while a run of an earlier mgmtd goes on. The program inherits the lock and holds it to its end; a
 // directory in which no lock can be made is no reason to start nothing.
-static bool lock_run(child *process) {
+bool lock_run(child *process) {
     if (process->lock_file.empty())
         return true;
     process->lock = open(process->lock_file.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
@@ -114,7 +116,7 @@ static bool lock_run(child *process) {
     return false;
 }
 
-static void start(supervisor *self, child *process) {
+void start_child(supervisor *self, child *process) {
     if (!lock_run(process)) {
         if (!process->waits)
             self->say("process " + process->name + ": an earlier one still runs; waits for its end");
@@ -142,13 +144,17 @@ static void start(supervisor *self, child *process) {
         self->restarted(process->name, process->last_end);
 }
 
+} // namespace
+
 void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout) {
     for (const child &process : self.children)
         inout->push_back({process.pidfd, POLLIN, 0});
 }
 
+namespace {
+
 // Whether it has ended, and its wait status. An end that somebody else has taken in counts as an exit with 0.
-static bool has_ended(const child &process, int *out_status) {
+bool has_ended(const child &process, int *out_status) {
     siginfo_t info = {};
     *out_status = 0;
     if (process.pidfd < 0)
@@ -161,11 +167,11 @@ static bool has_ended(const child &process, int *out_status) {
     return true;
 }
 
-static bool is_orderly(int wait_status) {
+bool is_orderly(int wait_status) {
     return WIFSIGNALED(wait_status) ? WTERMSIG(wait_status) == SIGTERM : WEXITSTATUS(wait_status) == 0;
 }
 
-static void take_end(supervisor *self, child *process, int status) {
+void take_end(supervisor *self, child *process, int status) {
     const int64_t now = self->now_ms(), ran = now - process->started_ms;
     const bool may_be_replaced = process->takes_over && !self->ending && !is_orderly(status);
     process->last_end = end_text(status);
@@ -184,6 +190,8 @@ static void take_end(supervisor *self, child *process, int status) {
     self->tell(end_event(status, self->ending), process->name);
 }
 
+} // namespace
+
 void supervisor_reap(supervisor *self) {
     for (child &process : self->children) {
         int status = 0;
@@ -195,11 +203,15 @@ void supervisor_reap(supervisor *self) {
     }
 }
 
-static bool is_session_of(const child &process, const std::string &name) {
+namespace {
+
+bool is_session_of(const child &process, const std::string &name) {
     if (process.command.empty())
         return name.starts_with(process.name + "-");
     return process.pidfd >= 0 && name == process.name + "-" + std::to_string(process.pid);
 }
+
+} // namespace
 
 void supervisor_session_opened(supervisor *self, const std::string &name) {
     for (child &process : self->children) {
@@ -239,8 +251,10 @@ bool supervisor_take_report(supervisor *self, const std::string &process) {
     return true;
 }
 
+namespace {
+
 // Gives the time until which the loss is not reported, or -1.
-static int64_t report_loss(supervisor *self, child *process, int64_t now) {
+int64_t report_loss(supervisor *self, child *process, int64_t now) {
     if (!process->loss)
         return -1;
     const int64_t due = process->loss->ended_ms + TAKE_OVER_MS;
@@ -253,7 +267,7 @@ static int64_t report_loss(supervisor *self, child *process, int64_t now) {
     return -1;
 }
 
-static int64_t end_last(supervisor *self, int64_t now) {
+int64_t end_last(supervisor *self, int64_t now) {
     for (auto process = self->children.rbegin(); process != self->children.rend(); ++process) {
         if (process->pidfd < 0)
             continue;
@@ -270,6 +284,8 @@ static int64_t end_last(supervisor *self, int64_t now) {
     return -1;
 }
 
+} // namespace
+
 int64_t supervisor_tick(supervisor *self) {
     const int64_t now = self->now_ms();
     if (self->ending)
@@ -278,7 +294,7 @@ int64_t supervisor_tick(supervisor *self) {
     for (child &process : self->children) {
         const bool may_start = process.pidfd < 0 && !process.command.empty();
         if (may_start && process.start_at_ms <= now)
-            start(self, &process);
+            start_child(self, &process);
         for (const int64_t due :
              {may_start && process.pidfd < 0 ? process.start_at_ms : -1, report_loss(self, &process, now)})
             if (due >= 0 && (next < 0 || due < next))

@@ -24,14 +24,18 @@
 #include "mgmt/gcl.h"
 #include "mgmt/gcl_wire.h"
 
-static constexpr const char *PROVIDER_NAME = "mgmtd";
-static constexpr int READS_A_TURN = 16;                                  // then the other sessions are read
-static constexpr const char *DAEMON_PREFIXES[] = {"wccpd-", "tunneld-"}; // of their session names
+namespace {
 
-static void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken);
-static bool fits_queue(const session &client, size_t bytes) {
+constexpr const char *PROVIDER_NAME = "mgmtd";
+constexpr int READS_A_TURN = 16;                                  // then the other sessions are read
+constexpr const char *DAEMON_PREFIXES[] = {"wccpd-", "tunneld-"}; // of their session names
+
+void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken);
+bool fits_queue(const session &client, size_t bytes) {
     return client.queued_bytes == 0 || client.queued_bytes + bytes <= QUEUE_MAX_BYTES;
 }
+
+} // namespace
 
 bool transport_listen(transport *self, server *owner, std::string *out_error) {
     self->owner = owner;
@@ -53,7 +57,9 @@ void transport_close(transport *self) {
 
 // --- Sending
 
-static void end_session(transport *self, session *client, const std::string &why) {
+namespace {
+
+void end_session(transport *self, session *client, const std::string &why) {
     if (client->ended)
         return;
     client->ended = true;
@@ -61,7 +67,7 @@ static void end_session(transport *self, session *client, const std::string &why
         self->owner->say("session of " + (client->name.empty() ? "a client" : client->name) + ": " + why);
 }
 
-static void queue_frame(transport *self, session *client, uint16_t proto, uint16_t mtype, std::string frame) {
+void queue_frame(transport *self, session *client, uint16_t proto, uint16_t mtype, std::string frame) {
     gcl_wire_header header{};
     const auto length = static_cast<uint32_t>(frame.size());
     memcpy(header.ident, GCL_FRAME_IDENT, sizeof header.ident);
@@ -82,7 +88,7 @@ static void queue_frame(transport *self, session *client, uint16_t proto, uint16
     client->queue.push_back(std::move(frame));
 }
 
-static void flush(transport *self, session *client) {
+void flush_queue(transport *self, session *client) {
     while (!client->queue.empty() && !client->ended) {
         const std::string &frame = client->queue.front();
         const ssize_t sent = send(client->fd, frame.data() + client->written, frame.size() - client->written,
@@ -105,15 +111,15 @@ static void flush(transport *self, session *client) {
 }
 
 template <typename Body>
-static void send_admin(transport *self, session *client, uint16_t mtype, const Body &body,
-                       const std::string &tail = "") {
+void send_admin(transport *self, session *client, uint16_t mtype, const Body &body,
+                const std::string &tail = "") {
     std::string frame(sizeof(gcl_wire_header), '\0');
     frame.append(reinterpret_cast<const char *>(&body), sizeof body);
     frame += tail;
     queue_frame(self, client, GCL_PROTO_ADMIN, mtype, std::move(frame));
 }
 
-static void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken) {
+void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken) {
     const owned_tbuffer buffer(taken);
     const auto found = self->sessions.find(id);
     if (found == self->sessions.end() || found->second.ended)
@@ -123,7 +129,7 @@ static void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *ta
         {reinterpret_cast<const char *>(tb_buf(taken)), static_cast<size_t>(std::max(tb_length(taken), 0))});
 }
 
-static void send_greeting(transport *self, session *client) {
+void send_greeting(transport *self, session *client) {
     gcl_wire_greeting greeting{};
     greeting.version = to_be16(GCL_ADMIN_VERSION);
     greeting.message_id = to_be32(self->admin_messages);
@@ -139,24 +145,24 @@ static void send_greeting(transport *self, session *client) {
 
 // --- Admin messages
 
-static std::string field_text(const char (&field)[32]) {
+std::string read_name_field(const char (&field)[32]) {
     return {field, strnlen(field, sizeof field)};
 }
 
-static bool is_daemon(const std::string &name) {
+bool is_daemon_name(const std::string &name) {
     return std::any_of(std::begin(DAEMON_PREFIXES), std::end(DAEMON_PREFIXES),
                        [&](const char *prefix) { return name.starts_with(prefix); });
 }
 
-static bool has_place(const transport *self, const std::string &name) {
+bool has_place(const transport *self, const std::string &name) {
     const auto clients = std::count_if(self->sessions.begin(), self->sessions.end(), [](const auto &each) {
         const session &other = each.second;
-        return !other.ended && other.stage != session::greeting_sent && !is_daemon(other.name);
+        return !other.ended && other.stage != session::greeting_sent && !is_daemon_name(other.name);
     });
-    return is_daemon(name) || clients < static_cast<ptrdiff_t>(CLIENT_SESSIONS_MAX);
+    return is_daemon_name(name) || clients < static_cast<ptrdiff_t>(CLIENT_SESSIONS_MAX);
 }
 
-static bool take_greeting_response(transport *self, session *client, std::string_view frame) {
+bool take_greeting_response(transport *self, session *client, std::string_view frame) {
     gcl_wire_greeting_response response;
     if (frame.size() < sizeof(gcl_wire_header) + sizeof response || client->stage != session::greeting_sent) {
         end_session(self, client, "bad greeting response");
@@ -164,7 +170,7 @@ static bool take_greeting_response(transport *self, session *client, std::string
     }
     memcpy(&response, frame.data() + sizeof(gcl_wire_header), sizeof response);
     const uint32_t uid = to_host(response.uid);
-    const std::string name = field_text(response.name);
+    const std::string name = read_name_field(response.name);
     const bool printable =
         !name.empty() && std::all_of(name.begin(), name.end(), [](char c) { return c > 0x20 && c < 0x7f; });
     if (to_host(response.version) != GCL_ADMIN_VERSION || !printable ||
@@ -174,7 +180,7 @@ static bool take_greeting_response(transport *self, session *client, std::string
     }
     const bool allowed = has_place(self, name);
     client->name = name;
-    if (is_daemon(name) && !client->owner.may_change) {
+    if (is_daemon_name(name) && !client->owner.may_change) {
         end_session(self, client, "refused, " + client->owner.user + " is no daemon's");
         return false;
     }
@@ -186,7 +192,7 @@ static bool take_greeting_response(transport *self, session *client, std::string
     return true;
 }
 
-static bool take_open_service(transport *self, uint32_t id, session *client, std::string_view frame) {
+bool take_open_service(transport *self, uint32_t id, session *client, std::string_view frame) {
     gcl_wire_open_service request;
     if (frame.size() < sizeof(gcl_wire_header) + sizeof request || client->stage == session::greeting_sent) {
         end_session(self, client, "bad service open");
@@ -219,8 +225,8 @@ static bool take_open_service(transport *self, uint32_t id, session *client, std
 
 // --- Frames
 
-static void take_frame(transport *self, uint32_t id, session *client, const gcl_wire_header &header,
-                       std::string_view frame) {
+void take_frame(transport *self, uint32_t id, session *client, const gcl_wire_header &header,
+                std::string_view frame) {
     const uint16_t proto = to_host(header.proto), mtype = to_host(header.mtype);
     if (proto == GCL_PROTO_ADMIN && mtype == GCL_ADMIN_GREETING_RESPONSE) {
         (void)take_greeting_response(self, client, frame);
@@ -237,7 +243,7 @@ static void take_frame(transport *self, uint32_t id, session *client, const gcl_
     }
 }
 
-static bool header_is_sound(const session &client, const gcl_wire_header &header) {
+bool header_is_sound(const session &client, const gcl_wire_header &header) {
     const uint32_t total = to_host(header.total_length);
     const uint32_t most = client.stage == session::opened ? GCL_FRAME_MAX : OPENING_FRAME_MAX;
     return memcmp(header.ident, GCL_FRAME_IDENT, sizeof header.ident) == 0 &&
@@ -245,7 +251,7 @@ static bool header_is_sound(const session &client, const gcl_wire_header &header
            total >= sizeof header && total <= most;
 }
 
-static void take_frames(transport *self, uint32_t id, session *client) {
+void take_frames(transport *self, uint32_t id, session *client) {
     size_t at = 0;
     while (!client->ended && client->unread.size() - at >= sizeof(gcl_wire_header)) {
         gcl_wire_header header;
@@ -264,7 +270,7 @@ static void take_frames(transport *self, uint32_t id, session *client) {
     client->unread.erase(0, at);
 }
 
-static void read_session(transport *self, uint32_t id, session *client) {
+void read_session(transport *self, uint32_t id, session *client) {
     char bytes[65536];
     for (int turns = 0; turns < READS_A_TURN; turns++) {
         const ssize_t got = recv(client->fd, bytes, sizeof bytes, MSG_DONTWAIT);
@@ -284,7 +290,7 @@ static void read_session(transport *self, uint32_t id, session *client) {
 }
 
 // False when all places are taken by sessions that have greeted.
-static bool make_room(transport *self) {
+bool make_room(transport *self) {
     if (self->sessions.size() < SESSIONS_MAX)
         return true;
     for (auto &[id, client] : self->sessions) // the oldest first
@@ -297,7 +303,7 @@ static bool make_room(transport *self) {
 
 // --- Who it is
 
-static bool is_member(int fd, const ucred &who, gid_t group) {
+bool is_member(int fd, const ucred &who, gid_t group) {
     gid_t groups[256];
     socklen_t length = sizeof groups;
     if (group == static_cast<gid_t>(-1))
@@ -310,13 +316,13 @@ static bool is_member(int fd, const ucred &who, gid_t group) {
 }
 
 // Names are not looked up: that may ask the network, and everybody would wait for it.
-static std::string name_of_user(uid_t uid) {
+std::string name_of_user(uid_t uid) {
     const passwd *entry = uid != 0 && uid == geteuid() ? getpwuid(uid) : nullptr;
     return uid == 0 ? "root" : entry ? entry->pw_name : "user " + std::to_string(uid);
 }
 
 // Why a connection is refused, or "".
-static std::string identify(const transport *self, int fd, session *out) {
+std::string identify(const transport *self, int fd, session *out) {
     ucred who{};
     socklen_t length = sizeof who;
     if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &who, &length) != 0)
@@ -332,7 +338,7 @@ static std::string identify(const transport *self, int fd, session *out) {
     return viewers < static_cast<ptrdiff_t>(VIEWER_SESSIONS_MAX) ? "" : "too many of those who may only look";
 }
 
-static void accept_session(transport *self) {
+void accept_session(transport *self) {
     const int fd = accept4(self->place.socket, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
     if (fd < 0) {
         // The connection still waits, and would end each poll at once.
@@ -358,7 +364,7 @@ static void accept_session(transport *self) {
 }
 
 // The end of a session may be reported to others, and end theirs.
-static void sweep(transport *self) {
+void remove_ended_sessions(transport *self) {
     for (bool again = true; again;) {
         again = false;
         for (auto at = self->sessions.begin(); at != self->sessions.end(); ++at) {
@@ -375,7 +381,7 @@ static void sweep(transport *self) {
 }
 
 // What is due by the clock. Gives the time until the next of it, `timeout_ms` at most (-1: no limit).
-static int64_t run_timers(transport *self, int64_t timeout_ms) {
+int64_t run_timers(transport *self, int64_t timeout_ms) {
     const int64_t now = self->owner->now_ms();
     if (now >= self->check_place_at_ms) {
         listener_check(&self->place);
@@ -395,11 +401,13 @@ static int64_t run_timers(transport *self, int64_t timeout_ms) {
     return timeout_ms < 0 ? left : std::min(timeout_ms, left);
 }
 
+} // namespace
+
 void transport_round(transport *self, std::vector<pollfd> *inout_others, int64_t timeout_ms) {
     const int64_t limit_ms = run_timers(self, timeout_ms);
     for (auto &[id, client] : self->sessions)
-        flush(self, &client);
-    sweep(self);
+        flush_queue(self, &client);
+    remove_ended_sessions(self);
     std::vector<pollfd> watched = *inout_others;
     const size_t others = watched.size();
     const bool accepts = self->owner->now_ms() >= self->accept_at_ms;
@@ -416,13 +424,13 @@ void transport_round(transport *self, std::vector<pollfd> *inout_others, int64_t
         session &client = self->sessions[ids[i]];
         const short came = watched[others + 1 + i].revents;
         if (came & POLLOUT)
-            flush(self, &client);
+            flush_queue(self, &client);
         if (came & (POLLIN | POLLHUP | POLLERR))
             read_session(self, ids[i], &client);
     }
     if (watched[others].revents & POLLIN)
         accept_session(self);
     for (auto &[id, client] : self->sessions)
-        flush(self, &client);
-    sweep(self);
+        flush_queue(self, &client);
+    remove_ended_sessions(self);
 }

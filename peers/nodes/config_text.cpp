@@ -14,12 +14,14 @@
 
 #include <algorithm>
 
-static std::string trimmed(const std::string &text) {
+namespace {
+
+std::string trim_blanks(const std::string &text) {
     const size_t from = text.find_first_not_of(" \t\r");
     return from == std::string::npos ? "" : text.substr(from, text.find_last_not_of(" \t\r") + 1 - from);
 }
 
-static bool unquoted(const std::string &text, std::string *out, std::string *out_reason) {
+bool strip_quotes(const std::string &text, std::string *out, std::string *out_reason) {
     *out = text;
     if (text.empty() || text[0] != '"')
         return true;
@@ -39,8 +41,8 @@ static bool unquoted(const std::string &text, std::string *out, std::string *out
     return false;
 }
 
-static std::string quoted(const std::string &text) {
-    if (!text.empty() && trimmed(text) == text && text[0] != '"')
+std::string add_quotes(const std::string &text) {
+    if (!text.empty() && trim_blanks(text) == text && text[0] != '"')
         return text;
     std::string out = "\"";
     for (const char c : text) {
@@ -51,7 +53,6 @@ static std::string quoted(const std::string &text) {
     return out + '"';
 }
 
-namespace {
 struct parser {
     config_text *text;
     int line = 0;
@@ -60,10 +61,9 @@ struct parser {
     std::string pending = {}; // comment lines that wait for what they belong to
     std::string heading = {}; // those in front of a section of which nothing has come yet
 };
-} // namespace
 
 // The section that a node is written in: its outermost instance, or the node above it.
-static node_name section_of(const node_name &name) {
+node_name find_section_of(const node_name &name) {
     node_name above;
     for (const std::string &part : name.parts) {
         above.parts.push_back(part);
@@ -77,19 +77,19 @@ static node_name section_of(const node_name &name) {
 
 // A section as somebody divides the file need not be one that is written: its comment goes with its first
 // node.
-static void place_heading(parser *state, const node_name &name) {
+void place_heading(parser *state, const node_name &name) {
     if (!state->heading.empty())
-        state->text->comments.before["[" + section_of(name).text() + "]"] += state->heading;
+        state->text->comments.before["[" + find_section_of(name).text() + "]"] += state->heading;
     state->heading.clear();
 }
 
-static void make_instances(parser *state, const node_name &name) {
+void make_instances(parser *state, const node_name &name) {
     for (const node_name &instance : instances_of(name))
         state->text->tree.set[instance] = instance.parts.back();
 }
 
-static bool take_section(parser *state, const std::string &line, std::string *out_reason) {
-    const std::string name_text = trimmed(line.substr(1, line.size() - 2));
+bool take_section(parser *state, const std::string &line, std::string *out_reason) {
+    const std::string name_text = trim_blanks(line.substr(1, line.size() - 2));
     node_name name;
     if (line.back() != ']' || !parse_node_name(name_text, &name)) {
         *out_reason = "a section is [/name]";
@@ -123,13 +123,13 @@ static bool take_section(parser *state, const std::string &line, std::string *ou
     return true;
 }
 
-static bool take_value(parser *state, const std::string &line, std::string *out_reason) {
+bool take_value(parser *state, const std::string &line, std::string *out_reason) {
     const size_t equals = line.find('=');
     if (equals == std::string::npos) {
         *out_reason = "expected [section] or name = value";
         return false;
     }
-    std::string name_text = trimmed(line.substr(0, equals)), value;
+    std::string name_text = trim_blanks(line.substr(0, equals)), value;
     if (name_text.empty() || (name_text[0] != '/' && state->section.empty())) {
         *out_reason = "\"" + shown_text(name_text) + "\" is no name from the root, and it is in no section";
         return false;
@@ -143,7 +143,7 @@ static bool take_value(parser *state, const std::string &line, std::string *out_
         return false;
     }
     std::string text;
-    if (!unquoted(trimmed(line.substr(equals + 1)), &value, out_reason) ||
+    if (!strip_quotes(trim_blanks(line.substr(equals + 1)), &value, out_reason) ||
         !check_value(*row, name, value, &text, out_reason)) {
         *out_reason = shown_text(name.text()) + ": " + *out_reason;
         return false;
@@ -162,6 +162,8 @@ static bool take_value(parser *state, const std::string &line, std::string *out_
     return true;
 }
 
+} // namespace
+
 std::string config_complaint(const std::string &file, const std::map<node_name, int> &lines,
                              const std::string &reason) {
     // The line of the node, or of the last one below it.
@@ -173,7 +175,9 @@ std::string config_complaint(const std::string &file, const std::map<node_name, 
     return file + ":" + (last ? std::to_string(last) + ": " : " ") + reason + "\n";
 }
 
-static bool take_line(parser *state, const std::string &line, std::string *out_reason) {
+namespace {
+
+bool take_line(parser *state, const std::string &line, std::string *out_reason) {
     if (line[0] == '[') {
         const bool good = take_section(state, line, out_reason);
         state->skipping = !good;
@@ -182,12 +186,14 @@ static bool take_line(parser *state, const std::string &line, std::string *out_r
     return state->skipping || take_value(state, line, out_reason);
 }
 
+} // namespace
+
 bool config_parse_part(const std::string &content, const std::string &file, config_text *out) {
     *out = {};
     parser state{out};
     for (size_t at = 0; at < content.size();) {
         const size_t end = std::min(content.find('\n', at), content.size());
-        const std::string line = trimmed(content.substr(at, end - at));
+        const std::string line = trim_blanks(content.substr(at, end - at));
         std::string reason;
         at = end + 1;
         state.line++;
@@ -219,15 +225,15 @@ std::string config_format(const node_tree &tree, const config_comments &comments
         return found == comments.before.end() ? std::string() : found->second;
     };
     for (const auto &[name, text] : tree.set) {
-        if (const node_name here = section_of(name); here != section) {
+        if (const node_name here = find_section_of(name); here != section) {
             section = here;
             out += std::string(out.empty() ? "" : "\n") + comment("[" + section.text() + "]") + "[" +
                    section.text() + "]\n";
         }
         if (find_schema_row(name)->instance)
             continue;
-        out += comment(name.text()) + name.text().substr(section.text().size() + 1) + " = " + quoted(text) +
-               "\n";
+        out += comment(name.text()) + name.text().substr(section.text().size() + 1) + " = " +
+               add_quotes(text) + "\n";
     }
     const std::string last = comment("");
     return last.empty() ? out : out + (out.empty() ? "" : "\n") + last;

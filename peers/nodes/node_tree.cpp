@@ -16,17 +16,21 @@
 #include "mgmt/bnode_types.h"
 #include "mgmt/node_paths.h"
 
-static const node_name service_groups = parsed_name(NODE_GROUP_CONFIG);
-static const node_name policy_groups = parsed_name(NODE_POLICY_CONFIG);
-static const node_name intercepts = parsed_name(NODE_INTERCEPT_CONFIG);
-static const node_name policy_membership = parsed_name(NODE_GROUP_CONFIG "/*/policy_grp");
+namespace {
 
-static bool has_wildcard(const node_name &pattern) {
+const node_name service_groups = parsed_name(NODE_GROUP_CONFIG);
+const node_name policy_groups = parsed_name(NODE_POLICY_CONFIG);
+const node_name intercepts = parsed_name(NODE_INTERCEPT_CONFIG);
+const node_name policy_membership = parsed_name(NODE_GROUP_CONFIG "/*/policy_grp");
+
+bool has_wildcard(const node_name &pattern) {
     for (const std::string &part : pattern.parts)
         if (part == "*")
             return true;
     return false;
 }
+
+} // namespace
 
 std::vector<node_name> instances_of(const node_name &name) {
     std::vector<node_name> out;
@@ -69,12 +73,14 @@ void tree_refresh(node_tree *tree) {
 
 // --- Checks of the whole
 
-static const std::string *text_at(const node_tree &tree, const node_name &name) {
+namespace {
+
+const std::string *find_text(const node_tree &tree, const node_name &name) {
     const auto found = tree.nodes.find(name);
     return found == tree.nodes.end() ? nullptr : &found->second.text;
 }
 
-static bool check_routers(const node_tree &tree, const node_name &group, std::string *out_reason) {
+bool check_routers(const node_tree &tree, const node_name &group, std::string *out_reason) {
     const node_name list = group.below("router");
     node_list entries;
     collect_nodes(tree.nodes, list, {false, false, false}, &entries);
@@ -87,7 +93,7 @@ static bool check_routers(const node_tree &tree, const node_name &group, std::st
                           std::to_string(expected - 1) + " is missing";
             return false;
         }
-        const std::string *address = text_at(tree, name.below("ipaddr"));
+        const std::string *address = find_text(tree, name.below("ipaddr"));
         if (!address) {
             *out_reason = name.text() + ": has no ipaddr";
             return false;
@@ -101,10 +107,10 @@ static bool check_routers(const node_tree &tree, const node_name &group, std::st
     return true;
 }
 
-static bool check_masks(const node_tree &tree, const node_name &group, std::string *out_reason) {
+bool check_masks(const node_tree &tree, const node_name &group, std::string *out_reason) {
     int bits = 0;
     for (const char *mask : {"mask_src_ip", "mask_dst_ip", "mask_src_port", "mask_dst_port"})
-        if (const std::string *text = text_at(tree, group.below(mask)))
+        if (const std::string *text = find_text(tree, group.below(mask)))
             bits += std::popcount(std::stoull(*text));
     if (bits <= 7)
         return true;
@@ -114,10 +120,9 @@ static bool check_masks(const node_tree &tree, const node_name &group, std::stri
 }
 
 // What a health check needs beside its kind.
-static bool check_health_argument(const node_tree &tree, const node_name &intercept,
-                                  std::string *out_reason) {
-    const std::string *kind = text_at(tree, intercept.below("check"));
-    const std::string *argument = text_at(tree, intercept.below("check_argument"));
+bool check_health_argument(const node_tree &tree, const node_name &intercept, std::string *out_reason) {
+    const std::string *kind = find_text(tree, intercept.below("check"));
+    const std::string *argument = find_text(tree, intercept.below("check_argument"));
     if (!kind || !argument || *kind == "tcp")
         return true;
     const bool http = *kind == "http";
@@ -128,6 +133,8 @@ static bool check_health_argument(const node_tree &tree, const node_name &interc
                   " in check_argument";
     return false;
 }
+
+} // namespace
 
 bool tree_check(const node_tree &tree, std::string *out_reason) {
     node_list roots;
@@ -160,11 +167,13 @@ void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk,
 
 // --- Commits
 
-static commit_result refused(uint32_t code, const std::string &name, const std::string &reason) {
+namespace {
+
+commit_result refuse_step(uint32_t code, const std::string &name, const std::string &reason) {
     return {code, shown_text(name) + ": " + reason, {}, {}};
 }
 
-static commit_result remove_step(node_tree *tree, const set_step &step, const node_name &name) {
+commit_result remove_step(node_tree *tree, const set_step &step, const node_name &name) {
     const bool instance = find_schema_row(name)->instance;
     bool found = tree->set.erase(name) > 0;
     for (auto at = tree->set.lower_bound(name); at != tree->set.end() && at->first.is_under(name);) {
@@ -172,29 +181,32 @@ static commit_result remove_step(node_tree *tree, const set_step &step, const no
         at = tree->set.erase(at);
     }
     if (!found && instance)
-        return refused(LC_NOT_FOUND, step.name, "does not exist");
+        return refuse_step(LC_NOT_FOUND, step.name, "does not exist");
     return {};
 }
 
-static commit_result value_step(node_tree *tree, const set_step &step, const node_name &name,
-                                const schema_row &row) {
+commit_result value_step(node_tree *tree, const set_step &step, const node_name &name,
+                         const schema_row &row) {
     const bool as_text = step.type == bn_type_str || (row.instance && step.type == bn_type_none);
     if (step.type != row.type && !as_text)
-        return refused(LC_BAD_TYPE, step.name,
-                       std::string("is of type ") + type_name(row.type) + ", not " + type_name(step.type));
+        return refuse_step(LC_BAD_TYPE, step.name,
+                           std::string("is of type ") + type_name(row.type) + ", not " +
+                               type_name(step.type));
     std::string text, reason;
     if (!check_value(row, name, step.text, &text, &reason))
-        return refused(LC_BAD_ARGUMENT, step.name, reason);
+        return refuse_step(LC_BAD_ARGUMENT, step.name, reason);
     for (const node_name &instance : instances_of(name)) {
         if (tree->set.contains(instance))
             continue;
         if (step.kind == set_kind::modify)
-            return refused(LC_NOT_FOUND, step.name, instance.text() + " does not exist");
+            return refuse_step(LC_NOT_FOUND, step.name, instance.text() + " does not exist");
         tree->set[instance] = instance.parts.back();
     }
     tree->set[name] = text;
     return {};
 }
+
+} // namespace
 
 std::vector<node_change> tree_difference(const node_map &before, const node_map &after) {
     std::vector<node_change> changes;
@@ -220,8 +232,10 @@ std::vector<node_change> tree_difference(const node_map &before, const node_map 
     return changes;
 }
 
-static std::vector<node_name> renewed_by(const node_tree &before, const std::vector<set_step> &steps,
-                                         const node_tree &after) {
+namespace {
+
+std::vector<node_name> find_renewed(const node_tree &before, const std::vector<set_step> &steps,
+                                    const node_tree &after) {
     std::vector<node_name> out;
     for (const set_step &step : steps) {
         node_name name;
@@ -232,16 +246,18 @@ static std::vector<node_name> renewed_by(const node_tree &before, const std::vec
     return out;
 }
 
+} // namespace
+
 commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &steps, node_tree *out_next) {
     out_next->set = tree.set;
     out_next->revision = tree.revision + 1;
     for (const set_step &step : steps) {
         node_name name;
         if (!parse_node_name(step.name, &name))
-            return refused(LC_BAD_PATH, step.name, "is no absolute node name");
+            return refuse_step(LC_BAD_PATH, step.name, "is no absolute node name");
         const schema_row *row = find_schema_row(name);
         if (!row)
-            return refused(LC_NOT_FOUND, step.name, "there is no such node in the configuration");
+            return refuse_step(LC_NOT_FOUND, step.name, "there is no such node in the configuration");
         commit_result result = step.kind == set_kind::remove ? remove_step(out_next, step, name)
                                                              : value_step(out_next, step, name, *row);
         if (result.code != 0)
@@ -251,7 +267,7 @@ commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &s
     std::string reason;
     if (!tree_check(*out_next, &reason))
         return {LC_ASSERTION, reason, {}, {}};
-    return {0, "", tree_difference(tree.nodes, out_next->nodes), renewed_by(tree, steps, *out_next)};
+    return {0, "", tree_difference(tree.nodes, out_next->nodes), find_renewed(tree, steps, *out_next)};
 }
 
 bool tree_check_change(const node_tree &before, const node_tree &after, std::string *out_reason) {

@@ -21,10 +21,12 @@
 #include "peers/nodes/value_lists.h"
 #include "runtime/logging.h"
 
-static constexpr size_t PART_MAX_BYTES = 255;  // of a name
-static constexpr size_t SHOWN_MAX_BYTES = 400; // of a text in a message
+namespace {
 
-static const char *check_level(std::string *inout) {
+constexpr size_t PART_MAX_BYTES = 255;  // of a name
+constexpr size_t SHOWN_MAX_BYTES = 400; // of a text in a message
+
+const char *check_level(std::string *inout) {
     const std::string &text = *inout;
     int32_t level = 0;
     for (const lc_enum_entry *entry = lc_log_level_table; entry->name; entry++)
@@ -33,7 +35,7 @@ static const char *check_level(std::string *inout) {
     return level || text.empty() ? nullptr : "is no log level (emerg to debug)";
 }
 
-static const char *check_facility(std::string *inout) {
+const char *check_facility(std::string *inout) {
     const std::string &text = *inout;
     for (const lc_enum_entry *entry = lc_log_facility_table; entry->name; entry++)
         if (text == std::to_string(entry->value))
@@ -41,7 +43,7 @@ static const char *check_facility(std::string *inout) {
     return "is no log facility (a multiple of 8 up to 184)";
 }
 
-static const char *check_protocol(std::string *inout) {
+const char *check_protocol(std::string *inout) {
     const std::string &text = *inout;
     const bool digits = !text.empty() && text.find_first_not_of("0123456789") == std::string::npos;
     if (digits)
@@ -53,12 +55,12 @@ static const char *check_protocol(std::string *inout) {
     return number < 0 ? "is no protocol; give a name such as tcp or udp, or a number from 1 to 255" : nullptr;
 }
 
-static const char *check_interface(std::string *inout) {
+const char *check_interface(std::string *inout) {
     const std::string &text = *inout;
     return text.find_first_of("/ \t:") == std::string::npos ? nullptr : "is no interface name";
 }
 
-static const char *check_path(std::string *inout) {
+const char *check_path(std::string *inout) {
     return inout->empty() || inout->front() == '/' ? nullptr : "does not begin with \"/\"";
 }
 
@@ -70,7 +72,7 @@ static const char *check_path(std::string *inout) {
 #define MESSAGES NODE_SYSLOG "/action/file/*/facility"
 #define MAIN_MESSAGES NODE_SYSLOG "/action/file/\\/var\\/log\\/messages/facility"
 
-static const std::vector<schema_row> rows = [] {
+const std::vector<schema_row> rows = [] {
     constexpr int64_t NUMBER_MAX = 0xffffffff;
     std::vector<schema_row> made = {
         {NODE_SYSTEM_MODE, bn_type_str, "router", 1, 15, "router|server|bridge", nullptr},
@@ -140,6 +142,8 @@ static const std::vector<schema_row> rows = [] {
         (void)parse_node_name(row.pattern, &row.parts);
     return made;
 }();
+
+} // namespace
 
 const std::vector<schema_row> &schema() {
     return rows;
@@ -257,12 +261,14 @@ const std::vector<const char *> &tunneld_state_nodes() {
 
 // --- Names
 
-static bool is_number(const std::string &part) {
+namespace {
+
+bool is_number(const std::string &part) {
     return !part.empty() && part.size() <= 18 && part[0] >= '0' && part[0] <= '9' &&
            part.find_first_not_of("0123456789") == std::string::npos;
 }
 
-static std::strong_ordering compare_parts(const std::string &a, const std::string &b) {
+std::strong_ordering compare_parts(const std::string &a, const std::string &b) {
     if (a == b)
         return std::strong_ordering::equal;
     if (is_number(a) != is_number(b))
@@ -272,6 +278,8 @@ static std::strong_ordering compare_parts(const std::string &a, const std::strin
             return by_value;
     return a.compare(b) <=> 0;
 }
+
+} // namespace
 
 std::strong_ordering operator<=>(const node_name &a, const node_name &b) {
     const size_t common = std::min(a.parts.size(), b.parts.size());
@@ -303,8 +311,12 @@ node_name node_name::below(const std::string &part) const {
     return out;
 }
 
+namespace {
+
 // Far deeper than any node. A peer may send names of millions of parts.
-static constexpr uint32_t NAME_PARTS_MAX = 64;
+constexpr uint32_t NAME_PARTS_MAX = 64;
+
+} // namespace
 
 bool parse_node_name(const std::string &text, node_name *out) {
     owned_tstr_array split;
@@ -367,7 +379,9 @@ bool canonical_text(uint32_t type, const std::string &text, std::string *out_tex
     return true;
 }
 
-static std::string from_hexadecimal(uint32_t type, const std::string &text) {
+namespace {
+
+std::string read_hexadecimal(uint32_t type, const std::string &text) {
     if (!bn_type_numeric(type) || text.size() < 3 || text.size() > 18 || text[0] != '0' ||
         (text[1] != 'x' && text[1] != 'X') ||
         text.find_first_not_of("0123456789abcdefABCDEF", 2) != std::string::npos)
@@ -375,7 +389,7 @@ static std::string from_hexadecimal(uint32_t type, const std::string &text) {
     return std::to_string(std::stoull(text.substr(2), nullptr, 16));
 }
 
-static bool is_one_of(const char *words, const std::string &text) {
+bool is_one_of(const char *words, const std::string &text) {
     for (const char *word = words; word;) {
         const char *end = strchr(word, '|');
         if (text == (end ? std::string(word, end) : std::string(word)))
@@ -385,12 +399,12 @@ static bool is_one_of(const char *words, const std::string &text) {
     return false;
 }
 
-static std::string range_text(const schema_row &row) {
+std::string describe_range(const schema_row &row) {
     return std::to_string(row.min) + " and " + std::to_string(row.max);
 }
 
 // What an instance goes by that is no number; the text goes after it.
-static const struct {
+const struct {
     uint32_t type;
     const char *fault;
 } other_instances[] = {
@@ -399,13 +413,13 @@ static const struct {
 };
 
 // The part has to be in its one form already: two names for one node would be two nodes.
-static bool check_instance(const schema_row &row, const std::string &part, std::string *out_reason) {
+bool check_instance(const schema_row &row, const std::string &part, std::string *out_reason) {
     const bool numeric = bn_type_numeric(row.type);
     std::string kept;
     *out_reason = "\"" + shown_text(part) + "\" ";
     if (!canonical_text(row.type, part, &kept) || kept != part ||
         (numeric && (std::stoll(part) < row.min || std::stoll(part) > row.max))) {
-        std::string fault = "is no number between " + range_text(row);
+        std::string fault = "is no number between " + describe_range(row);
         for (const auto &[type, other] : other_instances)
             if (type == row.type)
                 fault = other;
@@ -420,7 +434,7 @@ static bool check_instance(const schema_row &row, const std::string &part, std::
 }
 
 // What the configuration file could not give back, and what nobody would see.
-static bool check_part(const std::string &part, std::string *out_reason) {
+bool check_part(const std::string &part, std::string *out_reason) {
     const auto is_control = [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == 0x7f; };
     const char *fault = nullptr;
     if (std::any_of(part.begin(), part.end(), is_control))
@@ -435,6 +449,8 @@ static bool check_part(const std::string &part, std::string *out_reason) {
         *out_reason = "the part \"" + shown_text(part) + "\" of the name " + fault + "; write it without";
     return !fault;
 }
+
+} // namespace
 
 bool check_value(const schema_row &row, const node_name &name, const std::string &text, std::string *out_text,
                  std::string *out_reason) {
@@ -459,7 +475,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
     }
     const bool secret = name.parts.back() == "password";
     const std::string shown = secret ? "the password" : "\"" + shown_text(text) + "\"";
-    if (!canonical_text(row.type, from_hexadecimal(row.type, text), out_text)) {
+    if (!canonical_text(row.type, read_hexadecimal(row.type, text), out_text)) {
         *out_reason = shown + " is no " + type_name(row.type);
         return false;
     }
@@ -481,7 +497,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
             return false;
     } else if (bn_type_numeric(row.type) &&
                (std::stoll(*out_text) < row.min || std::stoll(*out_text) > row.max)) {
-        *out_reason = shown + " is not between " + range_text(row);
+        *out_reason = shown + " is not between " + describe_range(row);
         return false;
     }
     if (const char *reason = row.check ? row.check(out_text) : nullptr) {

@@ -9,13 +9,13 @@
 #include "mgmt/owners.h"
 
 namespace {
+
 struct number_range { // inclusive
     uint32_t first, last;
     bool operator<(const number_range &other) const { return first < other.first; }
 };
-} // namespace
 
-static std::vector<std::string> words_of(const std::string &text) {
+std::vector<std::string> split_words(const std::string &text) {
     std::istringstream in(text);
     std::vector<std::string> out;
     for (std::string word; in >> word;)
@@ -23,7 +23,7 @@ static std::vector<std::string> words_of(const std::string &text) {
     return out;
 }
 
-static std::string joined(const std::vector<std::string> &words) {
+std::string join_words(const std::vector<std::string> &words) {
     std::string out;
     for (const std::string &word : words)
         out += (out.empty() ? "" : " ") + word;
@@ -32,14 +32,14 @@ static std::string joined(const std::vector<std::string> &words) {
 
 // --- Ports
 
-static bool parse_port(const std::string &text, uint32_t *out) {
+bool parse_port(const std::string &text, uint32_t *out) {
     if (text.empty() || text.size() > 5 || text.find_first_not_of("0123456789") != std::string::npos)
         return false;
     *out = static_cast<uint32_t>(std::stoul(text));
     return *out >= 1 && *out <= UINT16_MAX;
 }
 
-static bool parse_range(const std::string &word, number_range *out) {
+bool parse_range(const std::string &word, number_range *out) {
     const size_t dash = word.find('-');
     if (!parse_port(word.substr(0, dash), &out->first))
         return false;
@@ -47,8 +47,10 @@ static bool parse_range(const std::string &word, number_range *out) {
     return dash == std::string::npos || parse_port(word.substr(dash + 1), &out->last);
 }
 
+} // namespace
+
 const char *check_ports(std::string *inout) {
-    const std::vector<std::string> words = words_of(*inout);
+    const std::vector<std::string> words = split_words(*inout);
     if (words.size() == 1 && words[0] == "all") {
         *inout = words[0];
         return nullptr;
@@ -75,24 +77,26 @@ const char *check_ports(std::string *inout) {
     kept.reserve(merged.size());
     for (const auto &[first, last] : merged)
         kept.push_back(std::to_string(first) + (last == first ? "" : "-" + std::to_string(last)));
-    *inout = joined(kept);
+    *inout = join_words(kept);
     return nullptr;
 }
 
 // --- Prefixes
 
-static const char *const NO_PREFIX = "is no IPv4 prefix such as 10.0.0.0/8";
-static const char *const NO_PREFIXES = "is no list of IPv4 prefixes such as 10.0.0.0/8 192.0.2.1/32";
-static const char *const HOST_BITS = "has host bits that are not zero; write the address of the network, "
-                                     "such as 10.0.0.0/8, or /32 for a host";
+namespace {
 
-static std::string prefix_text(const number_range &range) {
+const char *const NO_PREFIX = "is no IPv4 prefix such as 10.0.0.0/8";
+const char *const NO_PREFIXES = "is no list of IPv4 prefixes such as 10.0.0.0/8 192.0.2.1/32";
+const char *const HOST_BITS = "has host bits that are not zero; write the address of the network, "
+                              "such as 10.0.0.0/8, or /32 for a host";
+
+std::string format_prefix(const number_range &range) {
     owned_text out;
     const uint32_t mask = ~(range.last - range.first);
     return lc_ipv4prefix_to_str(uint64_t{range.first} << 32 | mask, &out.pointer) == LC_OK ? out.pointer : "";
 }
 
-static const char *parse_prefix(const std::string &word, const char *otherwise, number_range *out) {
+const char *parse_prefix(const std::string &word, const char *otherwise, number_range *out) {
     uint64_t prefix = 0;
     if (lc_str_to_ipv4prefix(word.c_str(), &prefix) != LC_OK)
         return otherwise;
@@ -102,17 +106,19 @@ static const char *parse_prefix(const std::string &word, const char *otherwise, 
     return (out->first & ~mask) == 0 ? nullptr : HOST_BITS;
 }
 
+} // namespace
+
 const char *check_prefix(std::string *inout) {
     number_range range = {};
     if (const char *reason = parse_prefix(*inout, NO_PREFIX, &range))
         return reason;
-    *inout = prefix_text(range);
+    *inout = format_prefix(range);
     return nullptr;
 }
 
 const char *check_prefixes(std::string *inout) {
     std::vector<number_range> all;
-    for (const std::string &word : words_of(*inout)) {
+    for (const std::string &word : split_words(*inout)) {
         number_range range = {};
         const bool bare = word.find('/') == std::string::npos;
         if (const char *reason = parse_prefix(bare ? word + "/32" : word, NO_PREFIXES, &range))
@@ -128,12 +134,12 @@ const char *check_prefixes(std::string *inout) {
     for (const number_range &range : all) {
         if (outer && range.last <= outer->last)
             continue;
-        kept.push_back(prefix_text(range));
+        kept.push_back(format_prefix(range));
         outer = &range;
     }
     if (kept.size() > LIST_MAX_ENTRIES)
         return "has more than 64 prefixes";
-    *inout = joined(kept);
+    *inout = join_words(kept);
     return nullptr;
 }
 
