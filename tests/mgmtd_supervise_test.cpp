@@ -38,7 +38,7 @@ TEST(Supervision, AnEarlierRunEndsFirst) {
         each->children[0].lock_file = "/tmp/slow.lock";
         each->now_ms = [&] { return now; };
         each->say = [&](const std::string &line) { said += line + "\n"; };
-        each->tell = [](const std::string &, const std::string &) {};
+        each->report = [](const std::string &, const std::string &) {};
     }
     (void)supervisor_tick(&earlier);
     said.clear();
@@ -69,7 +69,7 @@ TEST(Supervision, AChildWhoseEndSomebodyElseTookInIsOver) {
     self.children.push_back({"quick", {"true"}});
     self.now_ms = [] { return int64_t{1000}; };
     self.say = [](const std::string &) {};
-    self.tell = [&](const std::string &event, const std::string &) { told.push_back(event); };
+    self.report = [&](const std::string &event, const std::string &) { told.push_back(event); };
     (void)supervisor_tick(&self);
     ASSERT_FALSE(supervisor_is_done(self));
     ASSERT_EQ(waitpid(self.children[0].pid, nullptr, 0), self.children[0].pid);
@@ -88,7 +88,7 @@ TEST(Supervision, ALossIsReportedWhenNobodyTakesOverInTime) {
     self.children[0].takes_over = true;
     self.now_ms = [&] { return now; };
     self.say = [&](const std::string &line) { said += line + "\n"; };
-    self.tell = [&](const std::string &event, const std::string &) { told.push_back(event); };
+    self.report = [&](const std::string &event, const std::string &) { told.push_back(event); };
     self.restarted = [&](const std::string &process, const std::string &last_end) {
         restarts.push_back(process + " " + last_end);
     };
@@ -166,7 +166,7 @@ TEST(Supervision, SomebodyElsesProcessIsKnownByItsSessions) {
     self.children[0].takes_over = true;
     self.now_ms = [&] { return now; };
     self.say = [&](const std::string &line) { said += line; };
-    self.tell = [&](const std::string &event, const std::string &process) {
+    self.report = [&](const std::string &event, const std::string &process) {
         told.push_back(process + event);
     };
     EXPECT_EQ(supervisor_tick(&self), -1) << "nobody is started";

@@ -19,7 +19,7 @@ bool is_group(const node_name &name) {
     return matches(pattern, name);
 }
 
-// A change of a group that exists before and after.
+// Whether a running group, which exists before and after, applies the change.
 bool can_follow(const node_change &change) {
     const schema_row *row = find_schema_row(change.name);
     return change.after && row && !row->recreates;
@@ -38,7 +38,7 @@ void append_group(const node_map &nodes, const node_name &root, bool created, ch
 } // namespace
 
 wccpd_plan plan_for_wccpd(const node_tree &before, const node_tree &after, const commit_result &commit) {
-    std::set<node_name> whole; // groups that are deleted, created, or both
+    std::set<node_name> whole; // groups that are deleted, created, or both, with all their nodes
     for (const node_name &name : commit.renewed)
         if (is_group(name))
             whole.insert(name);
@@ -61,7 +61,8 @@ wccpd_plan plan_for_wccpd(const node_tree &before, const node_tree &after, const
 
 namespace {
 
-// At least the bytes that the bindings of a change take: up to five, each with the entry's name.
+// An upper estimate of the bytes in an event. A change has up to five bindings, each with the name of its
+// entry.
 size_t estimate_event_bytes(const node_change &change) {
     return 1000 + change.name.text().size() + (change.before ? change.before->text.size() : 0) +
            (change.after ? change.after->text.size() : 0);

@@ -1,4 +1,4 @@
-// The events in which the sessions learn of a commit.
+// How the changes of a commit are divided into change events.
 #pragma once
 
 #include <vector>
@@ -7,17 +7,18 @@
 
 using change_list = std::vector<node_change>;
 
-// wccpd follows an event that creates or deletes a group in that alone, and it cannot change the routers,
-// interface, priority or protocol of a running group, nor do without a node that has no default. A commit
-// therefore reaches it in up to three events: groups deleted, everything else, groups created. A group that
-// could not follow is in the first and in the last, whole.
+// If an event creates or deletes a group, wccpd applies nothing else of that event. A running group cannot
+// follow a change of its routers, interface, priority or protocol, nor the deletion of a node that has no
+// default. wccpd therefore gets a commit in up to three events: deleted groups, everything else, created
+// groups. A group that cannot follow is in the first and the last with all its nodes.
 struct wccpd_plan {
-    change_list events[3]; // in the order to send them; an empty one is left out
-    std::vector<node_name> recreated;
+    change_list events[3];            // in the order of sending; empty ones are not sent
+    std::vector<node_name> recreated; // groups that are deleted and created again
 };
 wccpd_plan plan_for_wccpd(const node_tree &before, const node_tree &after, const commit_result &commit);
 
-// One event holds so many bytes at most, and the rest of a group: groups are not cut.
+// An event has about this many bytes at most. It is larger when a single group is, because groups are not
+// divided.
 constexpr size_t EVENT_BYTES = 1u << 20;
 std::vector<std::vector<const node_change *>>
 cut_into_events(const std::vector<const node_change *> &changes);

@@ -1,5 +1,6 @@
-// Changes of the configuration: by a session, by the configuration file when it is read again, and what
-// becomes of them. A commit is checked, written to the file, taken over and only then sent as events.
+// Changes of the configuration: set requests of sessions, and the configuration file when it is read again. A
+// commit is checked, then saved, then taken over, and then reported by events: nobody hears of a change that
+// a crash could lose.
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
@@ -17,7 +18,7 @@
 #include "peers/mgmtd/server.h"
 #include "peers/nodes/secrets.h"
 
-// --- Events
+// --- Change events
 
 namespace {
 
@@ -47,6 +48,7 @@ std::vector<event_changes> select_events(const peer &who, std::span<const change
     return out;
 }
 
+// With passwords hidden from viewers.
 bn_request_msg *make_event_for(const server *self, uint32_t peer_id, const event_changes &event) {
     const auto who = self->peers.find(peer_id);
     if (who == self->peers.end() || who->second.owner.may_change)
@@ -111,7 +113,8 @@ std::string read_facility(const node_tree &tree) {
     return found == tree.nodes.end() ? "" : found->second.text;
 }
 
-// Programs read the facility before they have a session. Other lines of the file are somebody else's.
+// Programs read the file at their start, before they have a session. Lines that mgmtd does not know stay as
+// they are.
 void write_facility(const server *self) {
     if (self->facility_file.empty())
         return;
@@ -123,7 +126,7 @@ void write_facility(const server *self) {
         if (!line.starts_with("system "))
             content += line + "\n";
     if (good && content != before) {
-        std::error_code ignored; // the write says what is wrong
+        std::error_code ignored; // if this fails, so does the write, which gives the reason
         std::filesystem::create_directories(std::filesystem::path(self->facility_file).parent_path(),
                                             ignored);
         good = replace_file(self->facility_file, content, 0644, nullptr, &reason);
@@ -145,12 +148,12 @@ void server_take_over(server *self, node_tree next, const commit_result &commit)
     send_change_events(self, before, commit);
     server_forget_deleted_groups(self);
     server_forget_deleted_drains(self);
-    self->expire_at_ms = 0;
+    self->expire_at_ms = 0; // bypasses may have been added
 }
 
 namespace {
 
-// What mgmtd refuses beyond what a tree by itself shows.
+// Checks that need more than the tree: the present configuration and the addresses of this machine.
 bool check_commit(const server *self, const node_tree &next, std::string *out_reason) {
     const std::vector<std::string> bad = find_bad_routers(next, &self->tree, self->local_addresses());
     if (!bad.empty())
@@ -210,11 +213,11 @@ commit_result server_commit(server *self, const std::vector<set_step> &steps, co
     return result;
 }
 
-// --- Bypasses that end by themselves
+// --- Bypasses with a time
 
 namespace {
 
-// The clock may be set: while there is an entry with a time, it is looked at each minute.
+// While there is a bypass with a time, the clock is read at least this often, because it may be set.
 constexpr int64_t CLOCK_LOOK_MS = 60000;
 
 } // namespace
@@ -241,11 +244,11 @@ int64_t server_expire_bypasses(server *self) {
         server_commit(self, over,
                       {"mgmtd (bypasses whose time is over)", "mgmtd", "bypasses whose time is over"})
                 .code != 0)
-        wait_ms = CLOCK_LOOK_MS; // refused, as when the file cannot be written
+        wait_ms = CLOCK_LOOK_MS; // refused, perhaps because the disk is full: try again later
     return self->expire_at_ms = wait_ms < 0 ? -1 : now + wait_ms;
 }
 
-// --- The file
+// --- The configuration file
 
 namespace {
 
@@ -281,7 +284,8 @@ void server_begin(server *self) {
 namespace {
 
 bool read_file_again(server *self, config_text *out, std::string *out_warnings) {
-    // A file that is gone for a moment is no wish to have everything deleted.
+    // config_load takes a missing file for an empty one. Here it may be missing for a moment only, while an
+    // editor replaces it, and must not delete everything.
     if (access(self->file.path.c_str(), R_OK) != 0) {
         out->errors = self->file.path + ": " + strerror(errno) + "\n";
         return false;
@@ -301,7 +305,7 @@ bool read_file_again(server *self, config_text *out, std::string *out_warnings) 
     return true;
 }
 
-// What was read is one commit, of a file that is written already. False with the reason.
+// Adds the changes to the history as one commit. False with the reason.
 bool keep_reload(server *self, const config_text &read, const std::vector<node_change> &changes,
                  std::string *out_reason) {
     if (changes.empty())

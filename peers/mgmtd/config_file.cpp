@@ -1,4 +1,3 @@
-// The configuration file as mgmtd has read and written it.
 #include "peers/mgmtd/config_file.h"
 
 #include <cerrno>
@@ -24,7 +23,7 @@ bool config_load(config_file *file, config_text *out) {
 
 namespace {
 
-// Of a file that is gone nothing is lost.
+// False when replacing the file would lose an edit. A file that was removed has none.
 bool is_as_seen(const config_file &file, std::string *out_reason) {
     std::optional<std::string> now;
     if (!read_whole_file(file.path, &now, out_reason))
@@ -66,7 +65,7 @@ bool config_save(config_file *file, const node_tree &tree, const config_comments
 }
 
 std::string config_protect(const std::string &path) {
-    // By descriptor: the path may name another file by the time its mode is changed.
+    // By a descriptor, because the path may name another file by the time the mode is changed.
     const int fd = open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
     struct stat about;
     std::string out;

@@ -1,4 +1,4 @@
-// The configuration file: read at start, written at each commit.
+// The configuration file. It is read at the start and by SIGHUP, and written at each commit.
 #pragma once
 
 #include <optional>
@@ -6,16 +6,16 @@
 
 #include "peers/nodes/config_text.h"
 
-// A file as mgmtd has seen it, so that it notices when somebody else has changed it.
 struct config_file {
-    std::string path;                // "" keeps the configuration in memory only
-    std::optional<std::string> seen; // as it was last read or written; none: there was no file
+    std::string path;                // "": the configuration is in memory only
+    std::optional<std::string> seen; // the content when mgmtd last read or wrote it; none: there was no file
 };
-// A file that doesn't exist gives an empty tree. False when there are errors.
+// A file that does not exist gives an empty tree. False when there are errors.
 bool config_load(config_file *file, config_text *out);
-// The file is replaced in one step, readable by its owner only, since it holds passwords. Refused, with the
-// reason, when it does not hold what was seen of it, or when what was written would not be read the same.
+// Replaces the file in one step, with mode 0600 because it contains passwords. False with the reason, also
+// when the file was edited since mgmtd has seen it, and when reading the new text would not give the same
+// configuration.
 bool config_save(config_file *file, const node_tree &tree, const config_comments &comments,
                  std::string *out_reason);
-// Takes the rights of everybody but the owner away. What there is to report of it, or "".
+// Removes the rights of group and others. Gives a line for the log, or "" if there was nothing to remove.
 std::string config_protect(const std::string &path);

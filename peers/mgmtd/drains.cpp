@@ -1,13 +1,14 @@
-// Drains: an operator wants groups to be empty, so that the appliance can be stopped without breaking a
-// connection. wccpd announces the weight 0, which moves the group's buckets to the other appliances; tunneld
-// keeps new flows from the proxy and counts those that are left. With the last one, or when the time is over,
-// the group leaves its routers. It stays out until the drain is cancelled or the group deleted. The time is
-// kept here, for it has to end whatever becomes of tunneld.
+// A drain empties a group, so that the appliance can be stopped without breaking connections. wccpd announces
+// the weight 0, which moves the group's buckets to other appliances. tunneld keeps new flows from the proxy
+// and counts those that are left. After the last one has ended, or when the time is over, the group leaves
+// its routers. It stays out until the drain is cancelled or the group deleted. The time is kept here because
+// it has to end without tunneld as well.
 //
-//   /qv/alarms/state/drain/GROUP    draining, drained, or over: it has left with flows; below it since, until
-//                                   (seconds since 1970), and flows once tunneld has counted them
+//   /qv/alarms/state/drain/GROUP    "draining", "drained", or "over" if it has left with flows; below it
+//   since,
+//                                   until (seconds since 1970), and flows once tunneld has counted them
 //
-// Beside them, groups that announce a part of their weight for a time, because tunneld starts them slowly.
+// Also here: groups that announce a part of their weight during a slow start, which tunneld controls.
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 
@@ -82,7 +83,7 @@ void begin_drain(server *self, uint8_t group, uint32_t seconds) {
     server_send_overlay(self, group, before);
 }
 
-// The groups that an action is about: the one that it names, or all that are up.
+// The groups of an action: the one that it names, or all that are up. Gives a status code.
 uint32_t find_drain_groups(const server *self, const std::vector<event_field> &fields,
                            std::vector<uint8_t> *out, std::string *out_message) {
     uint32_t group = 0;
@@ -126,7 +127,7 @@ uint32_t server_begin_drain(server *self, const std::vector<event_field> &fields
     }
     for (const uint8_t group : groups)
         begin_drain(self, group, seconds);
-    (void)server_end_drains(self); // for a time of 0
+    (void)server_end_drains(self); // with a time of 0 they end at once
     return LC_OK;
 }
 
@@ -134,7 +135,7 @@ uint32_t server_cancel_drain(server *self, const std::vector<event_field> &field
     std::vector<uint8_t> groups;
     if (const uint32_t code = find_drain_groups(self, fields, &groups, out_message))
         return code;
-    if (!find_field(fields, "group")) { // also of those that are configured down meanwhile
+    if (!find_field(fields, "group")) { // all drains, also of groups that are no longer up
         groups.clear();
         for (const auto &[group, drain] : self->drains)
             groups.push_back(group);
@@ -193,7 +194,7 @@ void server_take_weight(server *self, uint32_t peer_id, const std::vector<event_
     server_send_overlay(self, group, before);
 }
 
-// --- Ends without a report
+// --- What ends without a report
 
 void server_orphan_weights(server *self, uint32_t peer_id) {
     for (auto &[group, slowed] : self->slowed)

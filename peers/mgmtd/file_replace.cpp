@@ -1,5 +1,6 @@
-// The new file is written beside the old one under a fixed name, synced, read back and renamed over it. The
-// name is fixed so that what a killed replacement leaves is found again; only one process may replace a file.
+// The new content is written to a file beside the old one, synced, read back, and renamed over the old one.
+// The name of the new file is fixed, so that the next start finds what an interrupted replacement has left.
+// Only one process may replace a file at a time.
 #include "peers/mgmtd/file_replace.h"
 
 #include <cerrno>
@@ -13,7 +14,7 @@
 namespace {
 
 constexpr size_t FILE_MAX_BYTES = 16u << 20;
-constexpr int LINKS_MAX = 40; // on the way to a file, as the kernel has it
+constexpr int LINKS_MAX = 40; // symbolic links that are followed, the same as in the kernel
 
 struct owned_fd {
     int fd;
@@ -26,7 +27,7 @@ struct owned_fd {
     }
 };
 
-// The file beside, until it is renamed.
+// The new file, which is removed unless it has been renamed.
 struct unfinished_file {
     std::string path;
     bool renamed = false;
@@ -51,7 +52,7 @@ std::string find_directory_of(const std::string &path) {
     return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
 }
 
-// Where the file is after all links are followed; the last of them may point to nothing yet.
+// The path after all symbolic links are followed. The last one may point to a file that does not exist yet.
 bool follow_links(const std::string &path, std::string *out, std::string *out_reason) {
     *out = path;
     for (int i = 0; i < LINKS_MAX; i++) {
@@ -86,7 +87,8 @@ bool read_all(int fd, std::string *out) {
 
 bool read_whole_file(const std::string &path, std::optional<std::string> *out, std::string *out_reason) {
     out->reset();
-    // A pipe would block the open and a device would be replaced by a file.
+    // Without O_NONBLOCK, opening a pipe would block. Devices are refused because a commit would replace
+    // them.
     const owned_fd file(open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
     if (file.fd < 0)
         return errno == ENOENT || fail_with_errno(out_reason);

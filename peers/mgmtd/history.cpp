@@ -1,5 +1,5 @@
-// A commit is kept as it is written to the configuration file, with a few lines in front that are comments
-// there: a copy of it is a configuration file.
+// The file of a commit is the text of the configuration file, after some lines that are comments there. A
+// copy of it is therefore a configuration file:
 //
 //   #% commit 17
 //   #% time 1764086301
@@ -7,12 +7,12 @@
 //   #% cause apply
 //   #% changes 2
 //   #% what /qv/wccpd/wccp/srv_grp/config/51/weight
-//   #% returns-to 16               until it is confirmed
+//   #% returns-to 16               only until it is confirmed
 //   #% confirm-by 1764086601
 //
-// The configuration file is what counts. A commit is prepared as "pending" before it is replaced, and becomes
-// "commit-17" after, by a rename that needs no room on the disk. Whatever mgmtd is killed in between, the
-// file says at the next start whether the pending commit was made.
+// The configuration file decides whether a commit was made. The commit is written as "pending" before that
+// file is replaced, and renamed to "commit-17" after it; the rename needs no space on the disk. If mgmtd is
+// killed in between, the next start compares "pending" with the configuration file.
 #include "peers/mgmtd/history.h"
 
 #include <algorithm>
@@ -48,7 +48,7 @@ bool parse_number(const std::string &text, Number *out) {
     return error == std::errc() && end == text.data() + text.size() && !text.empty();
 }
 
-// --- The form of an entry
+// --- The format of an entry
 
 std::string format_entry(const history_entry &entry, const std::string &text) {
     std::vector<std::pair<const char *, std::string>> lines = {
@@ -66,7 +66,7 @@ std::string format_entry(const history_entry &entry, const std::string &text) {
     return out + "\n" + text;
 }
 
-// False for what was not written by format_entry.
+// False if the content was not written by format_entry.
 bool parse_entry(const std::string &content, history_entry *out, std::string *out_text) {
     std::map<std::string, std::string> words;
     size_t at = 0;

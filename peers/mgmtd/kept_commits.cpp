@@ -1,16 +1,16 @@
-// The commits that are kept, as the server makes them and shows them:
+// How the server adds commits to the history, and the nodes that show them:
 //
-//   /mgmtd/config/state/text                     the configuration as its file has it
-//   /mgmtd/config/state/commit/N                 below it time, user, cause, changes, what
-//   /mgmtd/config/state/commit/N/text            the configuration after it
-//   /mgmtd/config/state/commit/N/confirm_by      while it waits to be confirmed; and returns_to
+//   /mgmtd/config/state/text                     the text of the configuration file
+//   /mgmtd/config/state/commit/N                 its number; below it time, user, cause, changes, what
+//   /mgmtd/config/state/commit/N/text            the text of the configuration after it
+//   /mgmtd/config/state/commit/N/confirm_by      only while it waits to be confirmed, as returns_to
 //
-// The texts are made when they are asked for by name; a walk goes without.
+// The texts are made when they are asked for by name. Walks leave them out.
 //
-// A commit that waits to be confirmed is always the last one: until it is confirmed or undone there is no
-// other. When its time is over the configuration before it is a new commit. The time that is left is measured
-// by the monotonic clock; only from one start of mgmtd to the next the wall clock tells it, and that can't
-// make it longer than it was.
+// Only the last commit can wait to be confirmed, because no other is taken meanwhile. When its time is over,
+// the configuration before it is restored by a new commit. The time runs by the monotonic clock. Over a
+// restart of mgmtd only the wall clock is left; a wall clock that was set back cannot make the time longer
+// than was asked for.
 #include <algorithm>
 
 #include "mgmt/node_paths.h"
@@ -19,8 +19,9 @@
 
 namespace {
 
-constexpr int64_t RETRY_MS = 60000; // of a return that failed, as when the disk is full
+constexpr int64_t RETRY_MS = 60000; // after a commit could not be undone, for example on a full disk
 
+// The commit that waits to be confirmed; null: none.
 const history_entry *waiting_commit(const server *self) {
     if (self->kept.entries.empty())
         return nullptr;
@@ -80,7 +81,8 @@ bool server_config_text(const server *self, const node_name &name, bool hide, no
     *out = {bn_type_str, ""};
     if (matches(kept, name))
         return kept_text(self, name, hide, &out->text);
-    if (!(name == present)) // the text takes its time, and every node of every query comes by here
+    if (!(name == present)) // checked first: every node of every query is looked up here, and the text is
+                            // slow to make
         return false;
     out->text = hide ? hidden_text(self->tree) : config_format(self->tree, self->comments);
     return true;
@@ -117,7 +119,7 @@ bool server_keep(server *self, const node_tree &next, const config_comments &com
 
 namespace {
 
-// The configuration that a commit replaces is kept as well, whatever has become of it in the history.
+// Adds the present configuration to the history if it is missing there: every commit can be undone.
 bool keep_present(server *self, const char *cause, std::string *out_reason) {
     if (self->kept.directory.empty() || history_find(self->kept, self->tree.revision))
         return true;
@@ -138,13 +140,14 @@ bool server_save(server *self, const node_tree &next, const config_comments &com
         history_abandon(self->kept);
         return false;
     }
-    if (std::string reason; !history_finish(&self->kept, entry, &reason)) // the file has it: it is made
+    // The configuration file has been replaced. Whatever fails from here on, the commit is made.
+    if (std::string reason; !history_finish(&self->kept, entry, &reason))
         self->say("commit " + std::to_string(entry.number) + " is not kept: " + reason);
     self->return_at_ms = -1;
     return true;
 }
 
-// The configuration that mgmtd starts with is the last commit, or becomes one.
+// If the configuration at the start is not that of the last commit, it becomes a commit.
 void server_open_history(server *self) {
     if (self->file.path.empty())
         return;
@@ -203,7 +206,8 @@ commit_result server_confirm(server *self, const std::string &who) {
 
 namespace {
 
-// What was in force once is not checked again as a change: a return must not fail because of where it starts.
+// Restores the configuration before the commit. It has been in force and is not checked again as a change:
+// the present state of the machine must not prevent the return.
 bool return_to(server *self, const history_entry &entry, std::string *out_reason) {
     const commit_order order = {"mgmtd", "mgmtd",
                                 "return to commit " + std::to_string(entry.returns_to) + ": commit " +

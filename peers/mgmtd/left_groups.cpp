@@ -1,11 +1,11 @@
-// Groups that are out of their routers because tunneld says so: their proxy is down. That is an operational
-// state, which wccpd sees through its overlay (overlays.cpp).
-//
-// It ends when tunneld says so, with the group, and when nobody is left who could: with the intercept while
-// tunneld is away, or once no tunneld has had a session for a time. A tunneld that has been started again
-// reports what it finds.
+// Groups that are out of their routers because tunneld reports that their proxy is down. This is an
+// operational state: it changes what wccpd is given (overlays.cpp), not the configuration.
 //
 //   /qv/alarms/state/left/GROUP                  the reason; below it since
+//
+// The state ends with a report of tunneld, or when the group is deleted. When tunneld has lost its session,
+// it also ends if the intercept is deleted, or if no tunneld has had a session for LEFT_KEEP_MS. Until then a
+// restarted tunneld can take over; it reports the state of all proxies again.
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 #include "peers/nodes/schema.h"
@@ -99,7 +99,8 @@ void server_take_join(server *self, uint32_t peer_id, const std::vector<event_fi
         end_leave(self, group, "reported by tunneld");
 }
 
-// A tunneld that has been started again doesn't know what the one before it has reported, only its proxies.
+// A restarted tunneld does not know which groups its predecessor has taken out, and so reports no join for
+// them. A proxy that is up means the same.
 void server_take_proxy_change(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     uint8_t group = 0;
     const std::string *up = find_field(fields, "up");
@@ -111,7 +112,7 @@ void server_take_proxy_change(server *self, uint32_t peer_id, const std::vector<
         end_leave(self, group, "its proxy is up");
 }
 
-// --- Ends without a report
+// --- Groups that return without a report
 
 void server_orphan_left_groups(server *self, uint32_t peer_id) {
     for (auto &[group, left] : self->left)

@@ -1,15 +1,15 @@
-// The directory lies in /tmp, where anybody may have made it first: it has to be a real directory of our own
-// user that nobody else may write to. Root moves what somebody else put there out of the way, which the owner
-// cannot undo in a /tmp with the sticky bit. Other users leave it and report it.
+// The directory is in /tmp, where anybody may have made it first. It has to be a real directory that belongs
+// to the user of mgmtd and that nobody else can write to. As root, mgmtd moves anything else out of the way;
+// in a /tmp with the sticky bit its owner cannot undo that. As another user, mgmtd reports it and ends.
 //
-// Two locks keep a second mgmtd off. The one on the directory also shows that a socket in it is left over
-// from an mgmtd that was killed, but it goes with the directory, which anything that cleans /tmp may remove.
-// Root's mgmtd therefore locks a file in /var/run as well. Both are held as long as the process lives.
+// Two locks prevent a second mgmtd. The lock on the directory shows in addition that a socket found there was
+// left by an mgmtd that was killed. It is lost with the directory, which programs that clean /tmp may remove.
+// As root, mgmtd therefore locks a file in /var/run as well. Both locks are held until the process ends.
 //
-// A client binds a name in the directory too, and removes it when it ends. What a killed one leaves is
-// removed when mgmtd starts and with each session that comes. Not when a session ends: its process is only
-// about to end then, and all sessions of a process share one name. A name that goes too early harms nobody,
-// because a session is connected by then, or connects to mgmtd's name and not to its own.
+// A client also binds a name in the directory and removes it when it ends. Names that killed clients have
+// left are removed when mgmtd starts and at each new session. The end of a session is too early: its process
+// may still run, and all sessions of a process share one name. Removing a name of a running process would do
+// no harm, because its sessions are connected already, or connect to the name of mgmtd and not to their own.
 #include "peers/mgmtd/listener.h"
 
 #include <cerrno>
@@ -36,8 +36,8 @@
 namespace {
 
 constexpr int BACKLOG = 64;
-constexpr int MOVES_MAX = 1000;     // names that are tried for what is moved aside
-constexpr int DIRECTORY_TRIES = 16; // against somebody who makes it again at the same time
+constexpr int MOVES_MAX = 1000;     // names to try for something that is moved aside
+constexpr int DIRECTORY_TRIES = 16; // in case somebody makes the directory again at the same time
 
 bool fail_with_errno(std::string *out_error, const std::string &what) {
     *out_error = what + ": " + strerror(errno);
@@ -77,7 +77,7 @@ bool move_aside(const listener *self, const std::string &path, uid_t owner, std:
             self->say(path + " belonged to user " + std::to_string(owner) + ", moved to " + aside);
             return true;
         }
-        if (errno == ENOENT) // its owner has removed it
+        if (errno == ENOENT) // its owner has removed it meanwhile
             return true;
         if (errno != EEXIST)
             break;
@@ -86,7 +86,7 @@ bool move_aside(const listener *self, const std::string &path, uid_t owner, std:
                            path + ": belongs to user " + std::to_string(owner) + " and can't be moved aside");
 }
 
-// False with the reason; `out_again` when it is worth another try.
+// False with the reason; `out_again` is whether another attempt may succeed.
 bool open_own_directory(const listener *self, const std::string &path, int *out_fd, bool *out_again,
                         std::string *out_error) {
     struct stat about;
@@ -124,7 +124,7 @@ bool open_directory(const listener *self, int *out_fd, std::string *out_error) {
     return false;
 }
 
-// The process that a client's socket is of, by its name "uds-client-NAME-PID"; 0 for other files.
+// The process of a client, from the name of its socket, "uds-client-NAME-PID"; 0 for other files.
 pid_t find_client_of(std::string_view file) {
     pid_t pid = 0;
     const size_t dash = file.rfind('-');
@@ -160,7 +160,7 @@ void listener_tidy(const listener *self) {
 
 namespace {
 
-// A process of that group needs no privilege for it: its socket is the group's already.
+// If mgmtd runs with that group as its own, the socket has the group already, and no privilege is needed.
 void admit_viewers(listener *self) {
     struct stat about;
     if (self->viewers == static_cast<gid_t>(-1))
@@ -185,7 +185,8 @@ bool open_socket(listener *self, std::string *out_error) {
     self->socket = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (self->socket < 0)
         return fail_with_errno(out_error, "socket");
-    // The length that clients connect with may count less than the whole record; the path decides.
+    // Clients may connect with a shorter address length. The kernel compares the path only, up to its zero
+    // byte.
     const mode_t before = umask(0177);
     const int bound = bind(self->socket, reinterpret_cast<sockaddr *>(&address), sizeof address);
     umask(before);
@@ -233,7 +234,7 @@ bool is_in_place(const listener &self) {
 void listener_check(listener *self) {
     if (is_in_place(*self))
         return;
-    // The old ones are of no use: nobody can reach a socket without a name.
+    // Nobody can connect to the old socket any more, which has lost its name.
     close_place(self);
     std::string error;
     if (open_place(self, &error)) {

@@ -1,5 +1,4 @@
-// The socket on which clients reach mgmtd, the directory that it lies in, and the lock that keeps a second
-// mgmtd off.
+// The socket on which clients reach mgmtd, its directory, and the lock that prevents a second mgmtd.
 #pragma once
 
 #include <functional>
@@ -7,8 +6,8 @@
 
 #include <sys/types.h>
 
-constexpr const char *VIEWERS_GROUP = "wccpd";                 // of the users who may look, but not change
-constexpr const char *MGMTD_LOCK_FILE = "/var/run/mgmtd.lock"; // of root's mgmtd
+constexpr const char *VIEWERS_GROUP = "wccpd";                 // users who may look, but change nothing
+constexpr const char *MGMTD_LOCK_FILE = "/var/run/mgmtd.lock"; // when mgmtd runs as root
 
 struct listener {
     std::function<void(const std::string &line)> say;
@@ -16,19 +15,19 @@ struct listener {
     int socket = -1; // non-blocking
     std::string path;
     std::string viewers_group = VIEWERS_GROUP;
-    gid_t viewers = static_cast<gid_t>(-1); // may connect; -1: there is no such group
-    gid_t group = 0;                        // of the socket's file
-    dev_t device = 0;                       // of the socket's file
+    gid_t viewers = static_cast<gid_t>(-1); // the members may connect; -1: the group does not exist
+    gid_t group = 0;                        // of the socket's file, as its device and inode
+    dev_t device = 0;
     ino_t inode = 0;
-    std::string complaint; // the last one, which isn't repeated
+    std::string complaint; // that was logged last, so that it is not repeated
 };
 
-// Makes the directory and the socket, with their owner and mode from the first moment. False with the reason,
-// also when another mgmtd runs.
+// Makes the directory and the socket. At no moment do they have another owner or a wider mode. False with the
+// reason, for example when another mgmtd runs.
 bool listener_open(listener *self, std::string *out_error);
-// When clients no longer find the socket under its path, because it or the directory was removed or replaced,
-// both are made again. Connections are not affected.
+// To be called now and then. If the socket or its directory was removed or replaced, clients no longer find
+// mgmtd; both are then made again. Open connections are not affected.
 void listener_check(listener *self);
-// Removes the sockets of clients that are gone.
+// Removes sockets whose clients no longer exist.
 void listener_tidy(const listener *self);
 void listener_close(listener *self);

@@ -23,8 +23,8 @@ namespace {
 
 constexpr uint32_t COMPONENT_MGMTD = 5u << 16;
 
-// Nobody has to read this output: a pipe that is full, or a terminal that is stopped, loses lines and blocks
-// nothing. After POLLOUT there is room for PIPE_BUF bytes.
+// Never blocks: if nobody reads the pipe, or the terminal is stopped, lines are lost. After POLLOUT there is
+// room for PIPE_BUF bytes.
 void print_line(const std::string &line) {
     static uint64_t lost;
     std::string text = lost ? "(" + std::to_string(lost) + " lines lost)\n" + line : line;
@@ -66,7 +66,7 @@ int64_t find_time_left(int64_t now, std::initializer_list<int64_t> due) {
     return left;
 }
 
-// To the service manager, when it is due. Gives the time of the next report, or -1.
+// Reports to the service manager that mgmtd is alive, when that is due. Gives when to call it again, or -1.
 int64_t report_alive(int64_t *inout_at_ms) {
     if (service_watchdog_ms() < 0)
         return -1;
@@ -130,7 +130,7 @@ int main(int argc, char **argv) {
     supervisor processes;
     processes.now_ms = lt_monotonic_ms;
     processes.say = print_line;
-    processes.tell = [&](const std::string &event, const std::string &process) {
+    processes.report = [&](const std::string &event, const std::string &process) {
         server_process_event(&daemon, event, process);
     };
     processes.restarted = [&](const std::string &process, const std::string &last_end) {

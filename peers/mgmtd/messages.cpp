@@ -33,7 +33,7 @@ bn_request_msg *make_change_event(const std::vector<const node_change *> &change
     owned_request msg;
     if (bn_event_request_msg_create(&msg.pointer, EVENT_CONFIG_CHANGE) != LC_OK)
         return nullptr;
-    // Readers sort the entries by name: numbers of one width keep the order of the tree.
+    // Readers sort the entries by name. Numbers of the same width keep the order of the tree.
     const size_t width = std::to_string(changes.size()).size();
     size_t number = 0;
     for (const node_change *change : changes) {

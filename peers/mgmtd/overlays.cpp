@@ -1,6 +1,6 @@
-// What wccpd is given instead of the configured values of a group, for as long as an operational state lasts:
-// "down" for the admin of a group that is out of its routers, a part of the weight for one that is being
-// emptied or that starts slowly. The file and the queries of others have what is configured.
+// While an operational state lasts, wccpd is given other values of a group than the configured ones: "down"
+// for the admin of a group that is out of its routers, and a part of the weight of one that is drained or
+// starts slowly. The configuration file and the answers to other clients have the configured values.
 #include <algorithm>
 
 #include "mgmt/node_paths.h"
@@ -29,7 +29,7 @@ group_overlay server_overlay_of(const server *self, uint8_t group) {
 
 namespace {
 
-// A part of a weight is at least 1, except when there is none.
+// At least 1, because a weight of 0 would take the group's whole share away; 0 percent does so on purpose.
 std::string take_part_of_weight(const std::string &text, uint32_t percent) {
     const uint64_t weight = std::stoull(text);
     if (percent == 0 || weight == 0)
@@ -45,7 +45,7 @@ node_value lay_over(const group_overlay &overlay, const std::string &leaf, const
     return value;
 }
 
-// The overlay that the node lies under. False: it is none of a group's own.
+// The overlay that applies to the node. False: it is not a direct child of a group.
 bool find_overlay(const server *self, const node_name &name, group_overlay *out) {
     const size_t depth = configured_groups().parts.size();
     if (name.parts.size() != depth + 2 || !name.is_under(configured_groups()))
@@ -73,7 +73,7 @@ void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout)
     });
 }
 
-// The weight comes first: a group that joins again does so with the weight that it is to have.
+// The weight is sent before the admin, so that a group joins its routers again with the right weight.
 void server_send_overlay(server *self, uint8_t group, const group_overlay &before) {
     const group_overlay now = server_overlay_of(self, group);
     std::vector<node_change> changes;

@@ -1,14 +1,13 @@
-// The daemons as their sessions show them, whoever starts them:
+// The processes of wccpd and tunneld, as their sessions show them:
 //
 //   /qv/alarms/state/process/NAME                "running" or "gone"; below it pid, since, restarts
 //
-// A session of another process id is a restart. A daemon that has not been seen yet has no node. The
-// supervisor sees each restart of its children, also of one that never opens a session; it then reports all
-// of them, and sessions are not counted.
+// A daemon that has not been seen yet has no node. A session with another process id is a restart. With
+// --supervise, the supervisor reports the restarts instead, because it also sees those of a program that
+// never opens a session.
 //
-// A daemon that is restarted again and again raises an alarm, RESTARTS_MAX times in RESTARTS_WITHIN_MS. The
-// alarm is cleared once the daemon has had a session for RESTARTS_WITHIN_MS without another restart. Its text
-// follows the number of restarts.
+// RESTARTS_MAX restarts within RESTARTS_WITHIN_MS raise an alarm. Its text follows the number of restarts. It
+// is cleared once the daemon has had a session for RESTARTS_WITHIN_MS without another restart.
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
 #include "runtime/logging.h"

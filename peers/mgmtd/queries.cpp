@@ -1,18 +1,18 @@
-// Queries: of the configuration and of what mgmtd itself reports from memory, of the state of a daemon by
-// asking that daemon.
+// Queries. The configuration and the states that mgmtd keeps are answered from memory. The state nodes of a
+// daemon are asked of the daemon: the query waits, while other messages are handled.
 //
-// The state nodes of each daemon are listed beside the schema; a query below one of their roots goes to the
-// daemon's session, all nodes of it in one request, with the rows in front as registration nodes. A query of
-// a subtree that holds such a root takes it along, and is none the worse when the daemon isn't there or
-// refuses.
+// The state nodes of each daemon are listed beside the schema. A query below one of their roots is forwarded
+// to the daemon's session, all its nodes in one request, after the list of state nodes as registration nodes.
+// A walk of a subtree that contains such a root includes the daemon's nodes if the daemon answers, and
+// succeeds without them.
 //
-// A walk of all service groups is asked for in steps: the list of groups first, then one group after the
-// other. The daemon therefore never builds an answer about more than one group, and a walk that comes to more
-// than a frame is refused here as soon as that is known. A walk above the roots of several daemons asks one
-// after the other, in the order of the table.
+// A walk of all service groups is forwarded in steps: the list of the groups, then group by group. The daemon
+// therefore builds no answer about more than one group, and a walk that becomes larger than a frame is
+// refused as soon as that shows. A walk above the roots of several daemons asks them one after the other, in
+// the order of the table.
 //
-// A node that can't be put into a message is left out, so that no asker waits in vain. The daemon
-// whose session it is asks for its configuration only; it is never asked for what it asked for.
+// A node that cannot be put into the answer is left out, so that the asker gets an answer in any case. A
+// daemon's own query is never forwarded to the session that it came from.
 #include <algorithm>
 
 #include "mgmt/bnode_proto.h"
@@ -35,11 +35,12 @@ const state_source state_sources[] = {
      {NODE_PLANE_STATE, NODE_TUNNEL_STATE, NODE_INTERCEPT_STATE, NODE_PROTECTION_STATE},
      tunneld_state_nodes},
 };
-constexpr uint32_t CAPABILITIES = 1;       // the nodes can be read
-constexpr size_t ANSWER_NODE_BYTES = 64;   // of a node in a message, beside its texts
-constexpr size_t PENDING_NODE_BYTES = 128; // of a node that waits, beside its name
+constexpr uint32_t CAPABILITIES = 1;       // of registered nodes: they can be read
+constexpr size_t ANSWER_NODE_BYTES = 64;   // of a node in a message, in addition to its texts
+constexpr size_t PENDING_NODE_BYTES = 128; // of a node that waits, in addition to its name
 
-// The newest working session of the daemon: the one that follows changes. 0 for none.
+// The newest session of the daemon that follows changes of the configuration, which its alarm session does
+// not. 0: none.
 uint32_t find_provider(const server *self, const state_source &source, uint32_t asker) {
     const std::string prefix = std::string(source.client) + "-";
     uint32_t found = 0;
@@ -82,7 +83,7 @@ daemon_part *find_part(std::vector<daemon_part> *parts, size_t source) {
     return &parts->back();
 }
 
-// Which of the node's answers come from a daemon.
+// Adds the nodes that daemons have to be asked for to the parts of the query.
 void plan_node(std::vector<daemon_part> *parts, const asked_node &asked, const node_name &name) {
     const bool subtree = asked.subop == bn_query_iterate && (asked.flags & bn_qf_subtree);
     for (size_t source = 0; source < std::size(state_sources); source++)
@@ -133,7 +134,8 @@ bool is_shown_all(const server *self, uint32_t asker) {
     return found != self->peers.end() && found->second.owner.may_change;
 }
 
-// What mgmtd answers itself. False when that is more than a message holds: the query has been refused.
+// Appends the nodes that mgmtd answers itself. False when the answer exceeds a message: the query has been
+// refused.
 bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
     size_t bytes = query.gathered_bytes;
     const auto asker = self->peers.find(query.asker);
@@ -199,7 +201,7 @@ bool may_wait(const server *self, const pending_query &query) {
            self->pending_bytes + query.bytes <= PENDING_BYTES_MAX;
 }
 
-// The request to the daemon; `query` gets the numbers of its nodes. Null when it can't be made.
+// The request to the daemon. The ids of its nodes go to `query`. Null when it cannot be made.
 bn_request_msg *make_forwarded(const state_source &source, const std::vector<asked_node> &nodes,
                                bool list_groups, pending_query *query) {
     owned_request msg;
@@ -221,7 +223,7 @@ bn_request_msg *make_forwarded(const state_source &source, const std::vector<ask
     return msg.take();
 }
 
-// 0 when the query waits for what the daemon answers about these nodes.
+// Asks the daemon of the current part for these nodes. Gives LC_OK when the query waits for the answer.
 uint32_t forward_query(server *self, const std::vector<asked_node> &nodes, bool list_groups,
                        pending_query query) {
     query.bytes = 0;
@@ -250,8 +252,8 @@ bool is_limit(uint32_t code) {
     return code == LC_NO_SPACE || code == LC_NO_BUFFER_SPACE;
 }
 
-// Sends what mgmtd answers itself and what the daemons have answered. A limit that was met is reported to
-// every asker, and leaves no room for anything else.
+// Sends the response: the nodes of mgmtd and those that daemons have answered. When a limit is exceeded, the
+// response has the code of the limit and no nodes.
 void finish_query(server *self, const pending_query &query, uint32_t code, const std::string &words) {
     if (is_limit(code)) {
         refuse_query(self, query, code, words);
@@ -272,8 +274,8 @@ void finish_query(server *self, const pending_query &query, uint32_t code, const
 
 void ask_next(server *self, pending_query query);
 
-// The daemon under way has answered all, or failed. A failure is reported to those who asked for its nodes by
-// name; to others it is nothing.
+// The daemon of the current part has answered everything, or failed. A failure is reported only if its nodes
+// were asked for by name.
 void end_part(server *self, pending_query query, uint32_t code, const std::string &words) {
     const bool whole = query.next_part > 0 && query.parts[query.next_part - 1].whole;
     if (is_limit(code) || (code != LC_OK && whole))
@@ -319,7 +321,7 @@ void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
 }
 
 void server_answer_without(server *self, pending_query query, uint32_t code, const std::string &why) {
-    if (query.next_part == 1) { // half an answer is none; what another daemon has answered is kept
+    if (query.next_part == 1) { // only this daemon has answered, and not completely
         query.gathered.reset();
         query.gathered_bytes = 0;
     }
@@ -328,7 +330,7 @@ void server_answer_without(server *self, pending_query query, uint32_t code, con
 
 namespace {
 
-// A dump of wccpd's has passwords in it. One that can't be made anew is left out.
+// Dumps of wccpd contain passwords. If there is no memory for the hidden text, the node is left out.
 void hide_passwords_in(bn_binding **inout) {
     const std::string name = name_of(*inout);
     const node_value value = value_of(*inout);
@@ -339,7 +341,8 @@ void hide_passwords_in(bn_binding **inout) {
     *inout = make_binding(name, {value.type, hidden});
 }
 
-// Takes over the daemon's bindings. False when a limit is met: the query has been refused.
+// Moves the bindings of the daemon's answer to the query. False when a limit is exceeded: the query has been
+// refused.
 bool gather_answer(server *self, pending_query *query, bn_response_msg *msg, size_t bytes) {
     query->gathered_bytes += bytes;
     if (query->gathered_bytes > GCL_FRAME_MAX) {
@@ -376,7 +379,7 @@ bool gather_answer(server *self, pending_query *query, bn_response_msg *msg, siz
 void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg, size_t bytes) {
     const auto found = self->pending.find(msg->response_to);
     if (found == self->pending.end() || found->second.provider != peer_id)
-        return; // too late, or never asked for
+        return; // the query has timed out, or was asked of another session
     pending_query query = server_take_pending(self, found);
     if (!gather_answer(self, &query, msg, bytes))
         return;

@@ -1,15 +1,15 @@
-// What the daemons report: active alarms and roles of service groups, as nodes that anybody can read.
+// Active alarms and roles of service groups, as daemons report them by events. Clients can read them as
+// nodes:
 //
 //   /qv/alarms/state/raised/TYPE/SOURCE          the text of the alarm; below it name, since, reporter
-//   /qv/alarms/state/role/GROUP                  the role's name; below it code, since
-//   /qv/alarms/state/left/GROUP                  why it is out of its routers; below it since
-//   (left_groups.cpp)
-//   /qv/alarms/state/drain/GROUP                 draining, drained, over (drains.cpp)
+//   /qv/alarms/state/role/GROUP                  the name of the role; below it code, since
 //
-// TYPE is the number of the alarm, SOURCE says what it is about. A report that comes again replaces the one
-// before. Nobody resends an alarm or a role. Those of a session that ends are therefore forgotten, because a
-// daemon that is gone watches nothing: the alarm counts as cleared, the role as UNKNOWN. Each report is
-// passed on to those with an interest in it, and so is each that is forgotten.
+// Other nodes below /qv/alarms/state are in left_groups.cpp, drains.cpp and processes.cpp.
+//
+// TYPE is the number of the alarm, SOURCE is what it is about. A repeated report replaces the one before.
+// Daemons do not resend alarms and roles. When a session ends, those that it reported are forgotten, because
+// nobody watches the condition any more: the alarm counts as cleared, and the role is UNKNOWN. Each report,
+// and each that is forgotten, is sent as an event to the sessions with an interest in it.
 #include <ctime>
 
 #include "mgmt/node_paths.h"
@@ -19,10 +19,9 @@
 
 namespace {
 
-// Of what a report says, as much is kept as a person reads; with ALARMS_MAX of them a walk still fits in one
-// message.
+// Texts of reports are cut to this many bytes, so that a walk of ALARMS_MAX alarms fits in one message.
 constexpr size_t TEXT_MAX = 512, SOURCE_MAX = 128;
-constexpr uint32_t OWN_REPORTS = 0; // instead of a session: those of mgmtd itself
+constexpr uint32_t OWN_REPORTS = 0; // instead of the id of a session: reports of mgmtd itself
 
 } // namespace
 
@@ -104,7 +103,7 @@ void take_role(server *self, uint32_t peer_id, const std::vector<event_field> &f
 const struct {
     const char *event;
     void (*take)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
-    bool repeated = false; // also sent without a change: `take` passes on what is one
+    bool repeated = false; // tunneld repeats it: `take` passes it on when it changes something
 } reports[] = {
     {EVENT_RAISE_ALARM, take_raised_alarm},
     {EVENT_CLEAR_ALARM, take_cleared_alarm},
@@ -147,7 +146,7 @@ void server_clear_own_alarm(server *self, const std::vector<event_field> &fields
 
 namespace {
 
-// What watchers get instead of the report that a daemon which is gone cannot send.
+// Sends watchers the event that the daemon can no longer send.
 void report_forgotten(server *self, const node_name &root) {
     const std::string &last = root.parts.back();
     if (root.is_under(parsed_name(NODE_ROLES)))

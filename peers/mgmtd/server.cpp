@@ -1,12 +1,12 @@
-// Sessions' messages: actions with the interests among them, changes of the configuration, events.
+// The messages of sessions: actions, set requests and events. Queries are in queries.cpp, commits in
+// commits.cpp, alarms and roles in reports.cpp.
 //
-// Everything runs on one thread, from the loop of the transport. A message is read, acted on and answered
-// before the next one; only a query for the state of another daemon waits, as a record in `pending`, and
-// nothing waits for it. What is sent goes to the transport's queue. Queries are in queries.cpp, commits in
-// commits.cpp, alarms and state events in reports.cpp.
+// Everything runs on one thread, called from the loop of the transport. A message is handled and answered
+// before the next one is read, except for a query that has to wait for a daemon: it becomes a record in
+// `pending`. Sending only appends to a queue of the transport.
 //
-// The transport says of a session whether its user may change anything. One who may not gets answers, without
-// passwords, and events. What comes is bounded by the frame that brought it.
+// The transport decides whether the user of a session may change anything. A viewer gets answers without
+// passwords, and events. The size of a request is bounded by that of a frame.
 #include "peers/mgmtd/server.h"
 
 #include <algorithm>
@@ -45,7 +45,7 @@ bool server_send_request(server *self, uint32_t peer_id, bn_request_msg *msg) {
 
 namespace {
 
-// A response without bindings instead of one that doesn't fit, whose bytes are freed.
+// A response without bindings, to be sent instead of one that is too large. Frees the bytes of that one.
 tbuffer *make_refusal(const bn_response_msg *msg, const char *words, tbuffer *unsent) {
     tb_free(&unsent);
     owned_response refusal;
@@ -143,7 +143,7 @@ bool may_add_interest(const peer &who, const interest &wish) {
     return count <= INTERESTS_MAX && bytes <= INTEREST_BYTES_MAX;
 }
 
-// "match/N/pattern" in the order of N; the order doesn't matter to a match.
+// The patterns are in fields "match/N/pattern". Their order does not matter.
 action_answer add_interest(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     interest wish;
     for (const event_field &field : fields) {
@@ -177,7 +177,7 @@ action_answer remove_interest(server *self, uint32_t peer_id, const std::vector<
     return {};
 }
 
-// What happened to a process, reported by whoever started it, or at its end by itself.
+// The end of a process, reported by the program that started it or by the process itself.
 action_answer report_process(server *self, uint32_t, const std::vector<event_field> &fields) {
     static const std::map<std::string, const char *> events = {
         {"crash", EVENT_PROCESS_CRASH},
@@ -216,7 +216,7 @@ action_answer run_action(server *self, uint32_t, const std::vector<event_field> 
 const struct {
     const char *name;
     action_answer (*run)(server *self, uint32_t peer_id, const std::vector<event_field> &fields);
-    bool looks = false; // changes nothing
+    bool looks = false; // changes nothing, and is allowed to viewers
 } actions[] = {
     {ACTION_ADD_INTEREST, add_interest, true},
     {ACTION_REMOVE_INTEREST, remove_interest, true},
@@ -231,7 +231,7 @@ std::string read_text(const tstring *text) {
     return text ? ts_str(text) : "";
 }
 
-// True when the session may change things; otherwise the request has been answered.
+// False for a viewer, whose request has been refused then.
 bool may_change(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     const peer_owner &owner = self->peers[peer_id].owner;
     if (!owner.may_change)
@@ -371,15 +371,14 @@ int64_t server_tick(server *self) {
     keep_earlier(&next, server_end_drains(self));
     keep_earlier(&next, server_expire_bypasses(self));
     keep_earlier(&next, server_clear_restart_alarms(self));
-    for (const auto &[id, query] : self->pending) // also those that have gone on to another daemon
+    for (const auto &[id, query] : self->pending) // last, because a query may have been forwarded meanwhile
         keep_earlier(&next, query.deadline_ms);
     return next;
 }
 
 namespace {
 
-// Of an action or event: all of them are copied, and those of a report are sent on.
-constexpr uint32_t FIELDS_MAX = 1024;
+constexpr uint32_t FIELDS_MAX = 1024; // of an action or event: they are copied, and sent on to watchers
 
 bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
     owned_request msg;
@@ -418,7 +417,7 @@ bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer 
 bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
     if (!self->peers.contains(peer_id) || mtype < bn_msg_query_request || mtype > bn_msg_event_ack)
         return false;
-    if (mtype % 2 == 1)
+    if (mtype % 2 == 1) // requests have odd types
         return take_request(self, peer_id, mtype, frame);
     owned_response msg;
     if (bn_response_msg_deserialize(frame, BN_FRAME_HEADER_BYTES, &msg.pointer) != LC_OK)

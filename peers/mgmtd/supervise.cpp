@@ -1,18 +1,20 @@
-// A child that ends is reported first and started again later: the daemon that hears of the end of tunneld
-// exits by itself, and is started again like any other. The delay doubles from one second to thirty with
-// each end and falls back after a run that lasted. Children get default signal handling, an empty signal
-// mask and SIGTERM should mgmtd die before them, so that its next start finds none of them left.
+// The end of a child is reported at once, and the child is started again after a delay. The delay doubles
+// with each end, from one second to thirty, and begins anew after a long run. wccpd exits by itself when it
+// hears of the end of tunneld, and is started again like any child. Children get default signal handling, an
+// empty signal mask, and SIGTERM if mgmtd dies before them, so that the next mgmtd finds none of them
+// running.
 //
-// A child that takes over is different: when it is killed or fails after it has had a session, it is started
-// again at once, and its loss is reported only if the new process has no session in time. What it has made in
-// the kernel is still there for the new one.
+// A child that takes over (tunneld) is different. If it crashes or fails after it has had a session, it is
+// started again at once, and its loss is reported only if the new process has no session in time: what the
+// old process has made in the kernel is still there, and the new one continues with it.
 //
-// A process that somebody else starts is known by its sessions. It ends with the last of them, and how is not
-// known: that is a crash of one that can be replaced, which is reported unless the next one has a session in
-// time. Therefore such a process reports an orderly end itself, with which all that it has made is gone.
+// A process that another program starts is known by its sessions. When its last session closes, it has ended,
+// in a way that mgmtd cannot know. For a process that can be taken over this counts as a crash, which is
+// reported unless the next process has a session in time. An orderly end removes what the process has made in
+// the kernel, and must be reported at once; the process therefore reports it itself.
 //
-// A child is held by a descriptor of the process and not by its number: the number may be another process's
-// as soon as somebody else has taken in the child's end.
+// A child is referred to by a descriptor and not by its number, which the kernel may give to another process
+// once the child has been waited for.
 #include "peers/mgmtd/supervise.h"
 
 #include <algorithm>
@@ -69,7 +71,7 @@ std::string end_text(int wait_status) {
     sigset_t none;
     sigemptyset(&none);
     sigprocmask(SIG_SETMASK, &none, nullptr);
-    for (int number = 1; number < NSIG; number++) // what was ignored would stay so
+    for (int number = 1; number < NSIG; number++) // ignored signals would stay ignored in the program
         signal(number, SIG_DFL);
     if (lock >= 0)
         fcntl(lock, F_SETFD, 0);
@@ -83,17 +85,17 @@ std::string end_text(int wait_status) {
     _exit(127);
 }
 
-// Null, or the step that failed, with errno.
+// Null, or the name of the call that failed, with errno.
 const char *fork_child(child *process) {
     const pid_t parent = getpid();
-    signal(SIGCHLD, SIG_DFL); // ignored, a child would be gone with its status before anybody looks
+    signal(SIGCHLD, SIG_DFL); // if it were ignored, the kernel would discard the child's status
     const pid_t pid = fork();
     if (pid == 0)
         exec_child(process->command, parent, process->lock);
     if (pid < 0)
         return "fork";
     process->pid = pid;
-    process->pidfd = pidfd_open(pid, 0); // its number is its own until its end is taken in
+    process->pidfd = pidfd_open(pid, 0); // the number is valid until the child is waited for
     if (process->pidfd >= 0)
         return nullptr;
     const int error = errno;
@@ -103,8 +105,8 @@ const char *fork_child(child *process) {
     return "pidfd_open";
 }
 
-// False while a run of an earlier mgmtd goes on. The program inherits the lock and holds it to its end; a
-// directory in which no lock can be made is no reason to start nothing.
+// False while a run that an earlier mgmtd started still holds the lock. The program inherits the lock and
+// keeps it until it ends. If the lock file cannot be made, the program is started without it.
 bool lock_run(child *process) {
     if (process->lock_file.empty())
         return true;
@@ -153,7 +155,8 @@ void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout) {
 
 namespace {
 
-// Whether it has ended, and its wait status. An end that somebody else has taken in counts as an exit with 0.
+// Whether the child has ended, and its wait status. If somebody else has waited for it, it counts as exited
+// with 0.
 bool has_ended(const child &process, int *out_status) {
     siginfo_t info = {};
     *out_status = 0;
@@ -181,13 +184,13 @@ void take_end(supervisor *self, child *process, int status) {
         process->loss && process->has_session && ran >= SHORT_RUN_MS ? 0 : next_delay(process->delay_ms, ran);
     process->start_at_ms = now + process->delay_ms;
     if (may_be_replaced && process->loss && process->delay_ms == 0)
-        return; // the next line says whether it has been replaced
+        return; // a later line says whether it has been replaced
     self->say("process " + process->name + ": " + end_text(status) +
               (self->ending ? "" : ", starts again in " + std::to_string(process->delay_ms / 1000) + " s"));
     if (may_be_replaced && process->loss)
         return;
     process->loss.reset();
-    self->tell(end_event(status, self->ending), process->name);
+    self->report(end_event(status, self->ending), process->name);
 }
 
 } // namespace
@@ -235,7 +238,7 @@ void supervisor_session_closed(supervisor *self, const std::string &name) {
         if (process.takes_over)
             process.loss = {EVENT_PROCESS_CRASH, "its session is lost", self->now_ms()};
         else
-            self->tell(EVENT_PROCESS_EXIT, process.name);
+            self->report(EVENT_PROCESS_EXIT, process.name);
     }
 }
 
@@ -253,7 +256,7 @@ bool supervisor_take_report(supervisor *self, const std::string &process) {
 
 namespace {
 
-// Gives the time until which the loss is not reported, or -1.
+// Reports the loss of a child that nobody has replaced in time. Gives when to call it again, or -1.
 int64_t report_loss(supervisor *self, child *process, int64_t now) {
     if (!process->loss)
         return -1;
@@ -263,7 +266,7 @@ int64_t report_loss(supervisor *self, child *process, int64_t now) {
     const process_loss loss = *std::exchange(process->loss, std::nullopt);
     self->say("process " + process->name + ": " + loss.text + ", not replaced in " +
               std::to_string(TAKE_OVER_MS) + " ms");
-    self->tell(loss.event, process->name);
+    self->report(loss.event, process->name);
     return -1;
 }
 

@@ -1,5 +1,5 @@
-// The processes that mgmtd starts: started, seen to end, reported, started again. Without --supervise
-// somebody else does, such as systemd, and mgmtd reports their ends by what it sees of their sessions.
+// Supervises tunneld and wccpd: starts them, reports their ends and starts them again. Without --supervise
+// another program, such as systemd, starts them, and their ends are known by their sessions only.
 #pragma once
 
 #include <cstdint>
@@ -12,68 +12,68 @@
 #include <sys/types.h>
 
 constexpr int64_t RESTART_DELAY_FIRST_MS = 1000, RESTART_DELAY_MAX_MS = 30000;
-constexpr int64_t SETTLED_MS = 60000; // a run of this length starts the delays over
+constexpr int64_t SETTLED_MS = 60000; // after a run of this length the delays begin with the first one again
 // From SIGTERM to SIGKILL. wccpd's orderly exit takes up to 5 s when tunneld doesn't answer.
 constexpr int64_t END_PATIENCE_MS = 10000;
 
-// For a child whose next run goes on with what the one before has left: from its end until the new process
-// has a session. Only then is the loss reported.
+// A child that takes over continues with what its predecessor has left. Its loss is reported only if the new
+// process has no session within this time.
 constexpr int64_t TAKE_OVER_MS = 3000;
-constexpr int64_t EARLIER_RUN_EVERY_MS = 200; // to the next look at a run that has to end first
-constexpr int64_t SHORT_RUN_MS = 500;         // a run that has ended sooner is not started again at once
+constexpr int64_t EARLIER_RUN_EVERY_MS = 200; // between two checks whether an earlier run has ended
+constexpr int64_t SHORT_RUN_MS = 500;         // after a shorter run the next start is delayed
 
-struct process_loss { // of a run whose next one may take over
+struct process_loss { // that is not reported yet, because the next run may take over
     const char *event;
     std::string text; // "ended by SIGKILL"
     int64_t ended_ms;
 };
 struct child {
     std::string name;
-    std::vector<std::string> command; // empty: somebody else starts it
+    std::vector<std::string> command; // empty: another program starts it
     pid_t pid = 0;
-    int pidfd = -1; // -1: does not run
+    int pidfd = -1; // -1: it does not run
     int64_t started_ms = 0, start_at_ms = 0, delay_ms = 0;
     int64_t kill_at_ms = -1;
     bool takes_over = false;
-    bool has_session = false; // this run has opened one
-    // Of a process that somebody else starts.
+    bool has_session = false; // this run has opened a session
+    // For a process that another program starts:
     int sessions = 0;          // that are open
-    bool end_reported = false; // by the process itself, whose sessions are about to close
+    bool end_reported = false; // the process has reported its end itself; its sessions are about to close
     std::optional<process_loss> loss = {};
     std::string last_end = {}; // "ended by SIGKILL"; "" before the first end
-    // A file that each run holds locked, or "". The run of a mgmtd that was killed may not have ended yet,
-    // and two at a time get into each other's way.
+    // A file that each run keeps locked; "": none. A run that a killed mgmtd has started may still be ending,
+    // and two runs at a time would disturb each other.
     std::string lock_file = {};
     int lock = -1;
-    bool waits = false; // for the end of such a run
+    bool waits = false; // for the end of such an earlier run
 };
 struct supervisor {
     std::vector<child> children; // in the order of their start
     std::function<int64_t()> now_ms;
     std::function<void(const std::string &line)> say;
-    std::function<void(const std::string &event, const std::string &process)> tell;
-    // A child has been started again after this end; null: nobody counts.
+    std::function<void(const std::string &event, const std::string &process)> report;
+    // Called after a child has been started again, with how it ended before; may be null.
     std::function<void(const std::string &process, const std::string &last_end)> restarted;
-    bool ending = false;
+    bool ending = false; // the children are being ended
 };
 
-// The program and its options from a command line, which is split at blanks; nothing is quoted. Empty for one
-// that has no word.
+// Splits a command line at blanks. There are no quotes.
 std::vector<std::string> command_words(const std::string &line);
-// Appends what becomes readable when a process ends.
+// Appends descriptors that become readable when a child ends.
 void supervisor_watch(const supervisor &self, std::vector<pollfd> *inout);
-// Takes in who has ended.
+// Handles the ends of children.
 void supervisor_reap(supervisor *self);
-// The session of this name, "tunneld-123", is open, or has been.
+// To be called when a session, "tunneld-123", has opened or closed.
 void supervisor_session_opened(supervisor *self, const std::string &name);
 void supervisor_session_closed(supervisor *self, const std::string &name);
-// A report of the end of a process. False when it is not to be passed on: the supervisor sees the end itself.
+// Takes the report of a process's end. False: it is not to be passed on, because the supervisor sees the end
+// itself.
 bool supervisor_take_report(supervisor *self, const std::string &process);
-// Starts who is due, or when ending, ends one after the other, the last started first. Gives the time of the
-// next thing to do, or -1.
+// Starts the children that are due. When ending, ends them one after the other, the one that was started last
+// first. Gives the time of the next thing to do, or -1.
 int64_t supervisor_tick(supervisor *self);
-bool supervisor_is_done(const supervisor &self); // nobody runs
-// What an end is called: the event, by the wait status.
+bool supervisor_is_done(const supervisor &self); // no child runs
+// The event for a wait status.
 const char *end_event(int wait_status, bool ending);
-// The delay before the next start, after a run of so long after a delay of `before_ms`.
+// The delay before the next start, after a run of `ran_ms` that was started after a delay of `before_ms`.
 int64_t next_delay(int64_t before_ms, int64_t ran_ms);

@@ -1,14 +1,15 @@
-// The sessions' sockets, one poll loop for all of them.
+// One poll loop serves the sockets of all sessions, and nothing in it blocks: a client that does not read
+// cannot stop the others.
 //
-// The stages of a session are: greeting sent, greeted (the client's name is known), open (the bnode service
-// is granted). Only whole frames are looked at, and a header that can't be true ends its session. What a
-// client makes mgmtd hold is therefore bounded by GCL_FRAME_MAX in and QUEUE_MAX_BYTES out. A client that
-// doesn't read never stops the others: nothing here blocks.
+// The stages of a session are: greeting sent, greeted (the name of the client is known), open (the bnode
+// service is granted). Frames are handled when they are complete, and a bad header ends the session. The
+// memory of a client is therefore bounded: GCL_FRAME_MAX for what it sends, QUEUE_MAX_BYTES for what it does
+// not read.
 //
-// The kernel says who a client is. Root and our own user may do everything, the members of a group may look;
-// nobody else is let in. Clients that crowd the socket leave the daemons their places: the name in the
-// greeting decides, and whoever takes long over the greeting gives way to a new connection. Those who may
-// only look have few places, and the name of a daemon is not for them.
+// The kernel identifies the user of a client. Root and the user of mgmtd may do everything, members of a
+// group may look, and others are refused. Some places are reserved for wccpd and tunneld, by the name in the
+// greeting. When all places are taken, a connection that has not greeted yet is ended in favour of a new one.
+// Viewers have few places, and cannot use the name of a daemon.
 #include "peers/mgmtd/transport.h"
 
 #include <algorithm>
@@ -27,8 +28,8 @@
 namespace {
 
 constexpr const char *PROVIDER_NAME = "mgmtd";
-constexpr int READS_A_TURN = 16;                                  // then the other sessions are read
-constexpr const char *DAEMON_PREFIXES[] = {"wccpd-", "tunneld-"}; // of their session names
+constexpr int READS_A_TURN = 16;                                  // of a session, before the others are read
+constexpr const char *DAEMON_PREFIXES[] = {"wccpd-", "tunneld-"}; // of the names of their sessions
 
 void send_bnode(transport *self, uint32_t id, uint16_t mtype, tbuffer *taken);
 bool fits_queue(const session &client, size_t bytes) {
@@ -137,7 +138,7 @@ void send_greeting(transport *self, session *client) {
     const std::string name = std::string(PROVIDER_NAME) + "-" + std::to_string(getpid());
     strlcpy(greeting.name, name.c_str(), sizeof greeting.name);
     greeting.uid = to_be32(geteuid());
-    greeting.gid = to_be32(self->place.group); // a client compares it with the file's
+    greeting.gid = to_be32(self->place.group); // the client compares it with that of the socket's file
     const passwd *entry = getpwuid(geteuid());
     strlcpy(greeting.user, entry ? entry->pw_name : "", sizeof greeting.user);
     send_admin(self, client, GCL_ADMIN_GREETING, greeting);
@@ -181,7 +182,7 @@ bool take_greeting_response(transport *self, session *client, std::string_view f
     const bool allowed = has_place(self, name);
     client->name = name;
     if (is_daemon_name(name) && !client->owner.may_change) {
-        end_session(self, client, "refused, " + client->owner.user + " is no daemon's");
+        end_session(self, client, "refused, " + client->owner.user + " may not use the name of a daemon");
         return false;
     }
     if (!allowed) {
@@ -289,19 +290,19 @@ void read_session(transport *self, uint32_t id, session *client) {
     }
 }
 
-// False when all places are taken by sessions that have greeted.
+// Ends a connection that has not greeted yet if all places are taken. False: all of them have greeted.
 bool make_room(transport *self) {
     if (self->sessions.size() < SESSIONS_MAX)
         return true;
-    for (auto &[id, client] : self->sessions) // the oldest first
+    for (auto &[id, client] : self->sessions) // in the order of their ids: the oldest first
         if (client.stage == session::greeting_sent && !client.ended) {
-            end_session(self, &client, "gave way to another, it has not greeted");
+            end_session(self, &client, "ended for a new connection, it has not greeted");
             return true;
         }
     return false;
 }
 
-// --- Who it is
+// --- The user of a client
 
 bool is_member(int fd, const ucred &who, gid_t group) {
     gid_t groups[256];
@@ -310,23 +311,24 @@ bool is_member(int fd, const ucred &who, gid_t group) {
         return false;
     if (who.gid == group)
         return true;
-    // Somebody in more groups than fit is let in by that one alone.
+    // Of a user in more groups than fit here, only the primary group counts.
     return getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, groups, &length) == 0 &&
            std::find(groups, groups + length / sizeof *groups, group) != groups + length / sizeof *groups;
 }
 
-// Names are not looked up: that may ask the network, and everybody would wait for it.
+// Only the user of mgmtd is looked up. The lookup of others may ask a server on the network, while all
+// sessions wait.
 std::string name_of_user(uid_t uid) {
     const passwd *entry = uid != 0 && uid == geteuid() ? getpwuid(uid) : nullptr;
     return uid == 0 ? "root" : entry ? entry->pw_name : "user " + std::to_string(uid);
 }
 
-// Why a connection is refused, or "".
+// Fills in the user of a connection. Gives why it is refused, or "".
 std::string identify(const transport *self, int fd, session *out) {
     ucred who{};
     socklen_t length = sizeof who;
     if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &who, &length) != 0)
-        return "nobody knows whose it is";
+        return "its user is not known";
     out->uid = who.uid;
     out->owner = {name_of_user(who.uid), who.uid == 0 || who.uid == geteuid()};
     if (out->owner.may_change)
@@ -341,7 +343,7 @@ std::string identify(const transport *self, int fd, session *out) {
 void accept_session(transport *self) {
     const int fd = accept4(self->place.socket, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
     if (fd < 0) {
-        // The connection still waits, and would end each poll at once.
+        // The connection stays in the backlog, and poll would return at once each time.
         if (errno != EAGAIN && errno != EINTR && errno != ECONNABORTED)
             self->accept_at_ms = self->owner->now_ms() + ACCEPT_PAUSE_MS;
         return;
@@ -363,7 +365,8 @@ void accept_session(transport *self) {
     send_greeting(self, &kept);
 }
 
-// The end of a session may be reported to others, and end theirs.
+// Removing a session may send events to other sessions and so end one of them; therefore the search starts
+// over.
 void remove_ended_sessions(transport *self) {
     for (bool again = true; again;) {
         again = false;
@@ -380,7 +383,7 @@ void remove_ended_sessions(transport *self) {
     }
 }
 
-// What is due by the clock. Gives the time until the next of it, `timeout_ms` at most (-1: no limit).
+// Does what is due by the clock. Gives the time until the next, `timeout_ms` at most (-1: no limit).
 int64_t run_timers(transport *self, int64_t timeout_ms) {
     const int64_t now = self->owner->now_ms();
     if (now >= self->check_place_at_ms) {

@@ -1,15 +1,13 @@
-// Reading and writing configurations as text.
-//
-//   # a comment, kept when the file is written again
-//   [/qv/wccpd/wccp/srv_grp/config/51]      the lines that follow are below this node
+//   # a comment, which is kept when the file is written again
+//   [/qv/wccpd/wccp/srv_grp/config/51]       the following lines are relative to this node
 //   interface = eth0
 //   router/1/ipaddr = 10.0.0.1
 //   password = "with  blanks"
 //   /qv/wccpd/system/config/mcast_ttl = 4    a name from the root
 //
-// A section of an instance makes the instance, also without lines of its own, and what it belongs to. A value
-// reaches from the first character to the last that is not blank; in quotes \" and \\ stand for the
-// characters themselves. Only what was set is written, never a default.
+// The section of an instance makes the instance, even without lines, and the instances that it belongs to.
+// Blanks around a value are not part of it. In quotes, \" and \\ stand for the characters. Only values that
+// were set are written, never defaults.
 #include "peers/nodes/config_text.h"
 
 #include <algorithm>
@@ -57,12 +55,12 @@ struct parser {
     config_text *text;
     int line = 0;
     std::string section = {}; // "" or an absolute name
-    bool skipping = false;    // the section was refused, and its lines with it
-    std::string pending = {}; // comment lines that wait for what they belong to
-    std::string heading = {}; // those in front of a section of which nothing has come yet
+    bool skipping = false;    // the section was refused; its lines are passed over
+    std::string pending = {}; // comment lines of the next node or section
+    std::string heading = {}; // comment lines of the current section, which has had no node yet
 };
 
-// The section that a node is written in: its outermost instance, or the node above it.
+// The section in which a node is written: its outermost instance, or else its parent.
 node_name find_section_of(const node_name &name) {
     node_name above;
     for (const std::string &part : name.parts) {
@@ -75,8 +73,8 @@ node_name find_section_of(const node_name &name) {
     return above;
 }
 
-// A section as somebody divides the file need not be one that is written: its comment goes with its first
-// node.
+// The file may have other sections than those that are written. The comments of a section go to the section
+// in which its first node is written.
 void place_heading(parser *state, const node_name &name) {
     if (!state->heading.empty())
         state->text->comments.before["[" + find_section_of(name).text() + "]"] += state->heading;
@@ -166,7 +164,7 @@ bool take_value(parser *state, const std::string &line, std::string *out_reason)
 
 std::string config_complaint(const std::string &file, const std::map<node_name, int> &lines,
                              const std::string &reason) {
-    // The line of the node, or of the last one below it.
+    // The last line that sets the node or a node below it.
     const node_name about = parsed_name(reason.substr(0, reason.find(": ")));
     int last = 0;
     for (const auto &[name, line] : lines)

@@ -1,12 +1,10 @@
-// The tree and its commits.
+// A commit works on a copy of the tree: the steps are applied one by one, and the result is checked as a
+// whole. Its changes are the differences between the nodes of both trees, defaults included. A new group is
+// therefore reported with its root and all its children, and deleting a node that has a default changes it to
+// that default.
 //
-// A commit works on a copy: the steps are carried out one by one, then the whole is checked, written to the
-// configuration file and only then replaces the old tree. The changes of a commit are the difference of the
-// nodes of both trees, defaults included: a new group is its root and all of its children, and a node that is
-// deleted and has a default is changed back to that default.
-//
-// Creating a child creates the instances that it belongs to. Modifying a child of an instance that does not
-// exist is refused, so that a mistyped number makes no new group.
+// Creating a child also creates the instances that it belongs to. Modifying a child of an instance that does
+// not exist is refused, so that a mistyped number does not make a new group.
 #include "peers/nodes/node_tree.h"
 
 #include <algorithm>
@@ -71,7 +69,7 @@ void tree_refresh(node_tree *tree) {
     }
 }
 
-// --- Checks of the whole
+// --- Checks of the whole tree
 
 namespace {
 
@@ -119,7 +117,7 @@ bool check_masks(const node_tree &tree, const node_name &group, std::string *out
     return false;
 }
 
-// What a health check needs beside its kind.
+// Health checks of some kinds need an argument.
 bool check_health_argument(const node_tree &tree, const node_name &intercept, std::string *out_reason) {
     const std::string *kind = find_text(tree, intercept.below("check"));
     const std::string *argument = find_text(tree, intercept.below("check_argument"));

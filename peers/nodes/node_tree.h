@@ -1,4 +1,4 @@
-// The configuration in memory: what was set, what holds with the defaults in it, and commits.
+// The configuration in memory, and the changes that a commit makes.
 #pragma once
 
 #include <cstdint>
@@ -13,21 +13,22 @@
 using node_map = std::map<node_name, node_value>;
 
 struct node_tree {
-    std::map<node_name, std::string> set; // what was set, in canonical text
-    node_map nodes;                       // what holds
-    uint32_t revision = 1;                // goes up with each commit that changes something
+    std::map<node_name, std::string> set; // values that were set, as canonical text
+    node_map nodes;                       // all values, defaults included
+    uint32_t revision = 1;                // rises with each commit that changes something
 };
 
 // Makes `nodes` from `set`.
 void tree_refresh(node_tree *tree);
-// What no single value shows: false with the reason.
+// Checks that need more than one value. False with the reason.
 bool tree_check(const node_tree &tree, std::string *out_reason);
 
-// The nodes below `root`: the direct children or the whole subtree, with the root itself or without.
 struct tree_walk {
-    bool subtree, include_self, leaves_only;
+    bool subtree;      // all nodes below the root; otherwise only its direct children
+    bool include_self; // the root as well
+    bool leaves_only;  // only nodes without nodes below them
 };
-// They are those of `nodes`, in its order.
+// Pointers into the map that was walked, in its order.
 using node_list = std::vector<const node_map::value_type *>;
 void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk, node_list *out);
 
@@ -35,7 +36,7 @@ enum class set_kind { create, modify, remove };
 struct set_step {
     set_kind kind;
     std::string name;
-    uint32_t type; // of the value as it came; a string converts to the node's own type
+    uint32_t type; // of the value in the request; a string is converted to the type of the node
     std::string text;
 };
 struct node_change {
@@ -46,15 +47,16 @@ struct commit_result {
     uint32_t code; // 0, or a status code
     std::string message;
     std::vector<node_change> changes; // in the order of the tree
-    std::vector<node_name> renewed;   // instances that the steps removed and created again
+    std::vector<node_name> renewed;   // instances that were removed and created again
 };
 
 std::vector<node_change> tree_difference(const node_map &before, const node_map &after);
 
-// The tree as it would be after all of the steps; or why not one of them can be taken.
+// Applies the steps to a copy of the tree. If one of them is refused, so are all.
 commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &steps, node_tree *out_next);
-// What only a change shows, as opposed to the tree that it leads to: false with the reason.
+// Checks that need the tree before the change. False with the reason.
 bool tree_check_change(const node_tree &before, const node_tree &after, std::string *out_reason);
 
-// The instances that the node belongs to, from the top, itself included when it is one.
+// The instances that the node belongs to, the outermost first; the last one is the node itself if it is an
+// instance.
 std::vector<node_name> instances_of(const node_name &name);

@@ -1,4 +1,4 @@
-// Where mgmtd listens: the session library connects there, mgmtd binds it, mgmtctl names it in messages.
+// The path of the socket on which mgmtd listens.
 #pragma once
 
 #include <string>

@@ -1,12 +1,12 @@
-// The rows of the schema and the checks that they ask for.
+// The rows of the schema, and the checks that they use.
 //
-// Conversion is that of the bindings, so that what is accepted here arrives as it is; on top of it a row has
-// a range, a length, words or a check of its own. Numbers may be written in hexadecimal, as masks are thought
-// of, and are kept in decimal.
+// Values are converted by the functions of the bindings, so that whatever is accepted here can be sent
+// unchanged. In addition a row has a range, a length, words or a check. Numbers may be hexadecimal, which is
+// usual for masks, and are kept in decimal.
 //
-// The defaults are such that a group takes part once its interface and its routers are set. A text that may
-// be empty has the empty text as its default: deleting a node of a group that has no default costs a running
-// group its place, since it is deleted and created again.
+// With the defaults, a group takes part once its interface and routers are set. The default of a text that
+// may be empty is the empty text. Without a default, deleting the node would have a running group deleted and
+// created again.
 #include "peers/nodes/schema.h"
 
 #include <algorithm>
@@ -107,7 +107,7 @@ const std::vector<schema_row> rows = [] {
         {GROUP "/mask_dst_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr},
         {GROUP "/compatibility", bn_type_str, "ios", 1, 15, "ios|nexus", nullptr},
 
-        // By service group: which of its redirected packets go to a local proxy.
+        // By service group: the redirected packets that go to a local proxy.
         {INTERCEPT, bn_type_uint8, nullptr, 0, 255, nullptr, nullptr, true},
         {INTERCEPT "/protocol", bn_type_str, "tcp", 1, 15, "tcp|udp", nullptr},
         {INTERCEPT "/ports", bn_type_str, "", 0, 1023, nullptr, check_ports},
@@ -180,7 +180,7 @@ const std::vector<const char *> &wccpd_state_nodes() {
         NODE_GROUP_STATE "/*/counter/*",
         NODE_GROUP_STATE "/*/debug",
         NODE_GROUP_STATE "/*/assignment",
-        // One that can be listed nowhere, so that a walk leaves it out.
+        // Its instances cannot be listed, so that walks leave it out.
         NODE_GROUP_STATE "/*/metric/*",
         NODE_GROUP_STATE "/*/owners",
         NODE_GROUP_STATE "/*/router/*",
@@ -194,7 +194,7 @@ const std::vector<const char *> &wccpd_state_nodes() {
         NODE_GROUP_STATE "/*/router/*/heard",
         NODE_GROUP_STATE "/*/router/*/appliance/*",
         NODE_GROUP_STATE "/*/router/*/appliance/*/load_dist",
-        // Appliances are asked for by number; as a node of its own the number keeps a walk out of it.
+        // Appliances are queried by their numbers. As a node of its own the number keeps walks out of them.
         NODE_GROUP_STATE "/*/appliance/*",
         NODE_GROUP_STATE "/*/appliance/*/ipaddr",
         NODE_GROUP_STATE "/*/appliance/*/weight",
@@ -313,7 +313,7 @@ node_name node_name::below(const std::string &part) const {
 
 namespace {
 
-// Far deeper than any node. A peer may send names of millions of parts.
+// Of any name from outside. A peer may send names of millions of parts.
 constexpr uint32_t NAME_PARTS_MAX = 64;
 
 } // namespace
@@ -403,7 +403,7 @@ std::string describe_range(const schema_row &row) {
     return std::to_string(row.min) + " and " + std::to_string(row.max);
 }
 
-// What an instance goes by that is no number; the text goes after it.
+// Instances that are not named by numbers, with the reason to refuse another name.
 const struct {
     uint32_t type;
     const char *fault;
@@ -412,7 +412,7 @@ const struct {
     {bn_type_ipv4prefix, "is no IPv4 prefix such as 10.0.0.0/8"},
 };
 
-// The part has to be in its one form already: two names for one node would be two nodes.
+// The name has to be in canonical form, or one thing could have two nodes.
 bool check_instance(const schema_row &row, const std::string &part, std::string *out_reason) {
     const bool numeric = bn_type_numeric(row.type);
     std::string kept;
@@ -433,7 +433,7 @@ bool check_instance(const schema_row &row, const std::string &part, std::string 
     return true;
 }
 
-// What the configuration file could not give back, and what nobody would see.
+// Refuses parts that the configuration file would not give back unchanged, or that nobody could see.
 bool check_part(const std::string &part, std::string *out_reason) {
     const auto is_control = [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == 0x7f; };
     const char *fault = nullptr;
@@ -457,7 +457,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
     for (const std::string &part : name.parts)
         if (!check_part(part, out_reason))
             return false;
-    // The numbers of all instances on the way down, for a child may be named before them.
+    // All instances in the name: a child may be set before they exist.
     for (const schema_row &above : rows) {
         const size_t depth = above.parts.parts.size();
         if (!above.instance || depth > name.parts.size())

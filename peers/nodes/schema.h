@@ -1,6 +1,5 @@
-// What the configuration may hold: one row for each kind of node. "*" in a pattern is a part that the
-// operator chooses. Everything that mgmtd knows of a node, it knows from its row; mgmtctl helps out of the
-// same.
+// The nodes that a configuration may have: one row for each kind of node. In a pattern "*" is a part that the
+// operator chooses. mgmtd knows of a node what is in its row, and mgmtctl has its help from the same table.
 #pragma once
 
 #include <compare>
@@ -8,8 +7,8 @@
 #include <string>
 #include <vector>
 
-// A name by its parts, unescaped. Parts that are numbers are ordered as numbers, so that 2 comes before 10,
-// and before all others.
+// A name as its parts, unescaped. Parts that are numbers are ordered by their value, so that 2 comes before
+// 10, and come before other parts.
 struct node_name {
     std::vector<std::string> parts;
 
@@ -19,40 +18,40 @@ struct node_name {
     friend bool operator==(const node_name &, const node_name &) = default;
     friend std::strong_ordering operator<=>(const node_name &a, const node_name &b);
 };
-// False for a name that is relative, has no parts, an empty one, or more than any node has.
+// False for a relative name, one without parts or with an empty part, and one with more than 64 parts.
 bool parse_node_name(const std::string &text, node_name *out);
-node_name parsed_name(const std::string &text); // no parts for a text that is no name
+node_name parsed_name(const std::string &text); // without parts if the text is not a name
 
 struct schema_row {
     const char *pattern;
     uint32_t type;
-    const char *fallback; // the default, or null: the node is absent then
-    int64_t min, max;     // of a number; of the length of a text; of the number that an instance goes by
-    const char *words;    // of a text, separated by "|"
-    // Further checks: null, and the text is brought into its one form, or the reason why it is refused.
+    const char *fallback; // the default; null: without a value the node is absent
+    int64_t min, max;     // of a number, of the length of a text, or of the number of an instance
+    const char *words;    // values of a text, separated by "|"; null: any
+    // Brings the value into its canonical form and gives null, or gives why it is refused. May be null.
     const char *(*check)(std::string *inout);
-    // The node is one of many: its value is the last part of its name, which is a number, an address or a
-    // prefix by the row's type. Its children need it.
+    // The node is one of many, such as a group. Its value is the last part of its name: a number, an address
+    // or a prefix, by the type of the row. Its children exist only with it.
     bool instance = false;
-    bool recreates =
-        false; // a running group follows a change of it only when it is deleted and created again
-    node_name parts = {};
+    bool recreates = false; // a running group follows a change only when it is deleted and created again
+    node_name parts = {};   // of the pattern
 };
 const std::vector<schema_row> &schema();
-// Patterns of the nodes that the daemons answer for.
+// Patterns of the state nodes that wccpd and tunneld answer.
 const std::vector<const char *> &wccpd_state_nodes();
 const std::vector<const char *> &tunneld_state_nodes();
 const schema_row *find_schema_row(const node_name &name); // null: there is no such node
 bool matches(const node_name &pattern, const node_name &name);
 
-// A text from outside as messages quote it: without control characters, and cut when it is long.
+// A text from outside for use in a message: without control characters, and cut when it is long.
 std::string shown_text(const std::string &text);
-// Checks the parts of the name and brings the value into its one form. False with the reason for a bad one;
-// the reason repeats no password.
+// Checks the parts of the name and the value, and brings the value into its canonical form. False with the
+// reason, in which a password is not repeated.
 bool check_value(const schema_row &row, const node_name &name, const std::string &text, std::string *out_text,
                  std::string *out_reason);
-// Text of one type into the form that the type's own conversion gives.
+// Brings a value of the type into canonical form by the conversions of the bindings.
 bool canonical_text(uint32_t type, const std::string &text, std::string *out_text);
-// The words for the numbers in wccpd's reports.
+// The names of an alarm type and of a role, which events have as decimal numbers; "unknown" and "UNKNOWN" for
+// others.
 const char *alarm_name(const std::string &type);
 const char *role_name(const std::string &role);

@@ -11,7 +11,7 @@ std::string hidden_value(const std::string &name, const std::string &value) {
     std::string text = value;
     if (name.ends_with("/password"))
         return text.empty() ? text : HIDDEN;
-    // A dump has it in a line of its own.
+    // Dumps have a line "WCCP password : ..." for each group.
     if (!name.ends_with("/debug") && !name.ends_with("/debug_all"))
         return text;
     for (size_t at = text.find(label); at != std::string::npos; at = text.find(label, at + 1)) {

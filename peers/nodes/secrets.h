@@ -1,4 +1,4 @@
-// Passwords, which are shown as eight stars: in nodes, and in the dumps of groups that wccpd answers with.
+// Hides passwords, in nodes and in the dumps of wccpd: eight stars are shown instead.
 #pragma once
 
 #include <map>
@@ -9,6 +9,6 @@
 constexpr const char *HIDDEN = "********";
 
 bool is_secret(const node_name &name);
-// The value of a node with its passwords hidden, if it has any. An empty password is none.
+// The value of a node with its passwords hidden. An empty password stays empty.
 std::string hidden_value(const std::string &name, const std::string &value);
 void hide_secrets(std::map<node_name, std::string> *inout);

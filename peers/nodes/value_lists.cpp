@@ -125,7 +125,8 @@ const char *check_prefixes(std::string *inout) {
             return reason;
         all.push_back(range);
     }
-    // Two prefixes are apart, or one is inside the other; the wider of two with the same beginning is first.
+    // Two prefixes never overlap in part: either they are disjoint, or one contains the other. Of two that
+    // begin with the same address the wider one is sorted first.
     std::sort(all.begin(), all.end(), [](const number_range &a, const number_range &b) {
         return a.first != b.first ? a.first < b.first : a.last > b.last;
     });
