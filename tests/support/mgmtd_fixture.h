@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cstdlib>
 #include <fstream>
+#include <initializer_list>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -65,7 +66,7 @@ struct Mgmtd : testing::Test {
         server_peer_opened(&daemon, 1, "wccpd-7"); // the working session
         server_peer_opened(&daemon, 2, "wccpd-7"); // the alarm session
         server_peer_opened(&daemon, 3, "mgmtctl-8");
-        action(1, "/mgmtd/events/actions/interest/add",
+        action(1, ACTION_ADD_INTEREST,
                {{"event_name", {bn_type_name, EVENT_CONFIG_CHANGE}},
                 {"match/1/pattern", {bn_type_str, "/qv/wccpd/**"}},
                 {"match/2/pattern", {bn_type_str, "/qv/tunneld/system/config/mode/**"}}});
@@ -100,6 +101,34 @@ struct Mgmtd : testing::Test {
             ASSERT_EQ(bn_action_request_msg_append_binding_takeover(msg, 0, &binding, nullptr), LC_OK);
         }
         EXPECT_TRUE(give(peer_id, msg));
+    }
+    void follow(uint32_t peer_id, std::initializer_list<const char *> events_of) {
+        for (const char *event : events_of) {
+            action(peer_id, ACTION_ADD_INTEREST, {{"event_name", {bn_type_name, event}}});
+            EXPECT_EQ(code(), 0u);
+        }
+        clear();
+    }
+    void open(uint32_t peer_id, const char *name) { server_peer_opened(&daemon, peer_id, name); }
+    void close(uint32_t peer_id) { server_peer_closed(&daemon, peer_id); }
+    // What wccpd gets when an action of group 51, or of no group, is carried out; an event of it is taken;
+    // the time is so much later.
+    strings act(const char *name, const std::vector<event_field> &fields = {}) {
+        clear();
+        action(3, name, fields);
+        return changes();
+    }
+    strings report(uint32_t peer_id, const char *event, std::vector<event_field> fields = {}) {
+        fields.push_back({"group", {bn_type_uint8, "51"}});
+        clear();
+        EXPECT_TRUE(give(peer_id, make_event(event, fields)));
+        return changes();
+    }
+    strings tick(int64_t after_ms) {
+        clear();
+        now += after_ms;
+        (void)server_tick(&daemon);
+        return changes();
     }
     void query(uint32_t peer_id, const std::string &name, uint32_t subop, uint32_t flags = 0) {
         bn_request_msg *msg = nullptr;
@@ -155,16 +184,27 @@ struct Mgmtd : testing::Test {
     }
     std::string message() { return ts_str(last_response()->return_message); }
     // "name=value" of each binding of the last response.
-    std::vector<std::string> found() {
-        std::vector<std::string> out;
+    strings found() {
+        strings out;
         if (const bn_response_msg *response = last_response())
             for (const event_field &field : fields_of(response))
                 out.push_back(field.name + "=" + field.value.text);
         return out;
     }
+    // The value of a node, "" without one; those of a subtree, without times.
+    std::string value(const std::string &name, uint32_t peer_id = 3) {
+        query(peer_id, name, bn_query_get);
+        return found().empty() ? "" : found().front().substr(name.size() + 1);
+    }
+    strings walk(const std::string &name) {
+        query(3, name, bn_query_iterate, bn_qf_subtree);
+        strings out = found();
+        std::erase_if(out, [](const std::string &node) { return node.find("/since=") != std::string::npos; });
+        return out;
+    }
     // What the daemon makes of each change event that the peer was sent: "name=old>new", "-" for none.
-    std::vector<std::vector<std::string>> events(uint32_t peer_id = 1) {
-        std::vector<std::vector<std::string>> out;
+    std::vector<strings> events(uint32_t peer_id = 1) {
+        std::vector<strings> out;
         for (const sent_message &one : sent) {
             if (one.peer != peer_id || one.mtype != bn_msg_event)
                 continue;
@@ -189,9 +229,9 @@ struct Mgmtd : testing::Test {
         }
         return out;
     }
-    std::vector<std::string> changes() {
-        std::vector<std::string> out;
-        for (const std::vector<std::string> &event : events())
+    strings changes() {
+        strings out;
+        for (const strings &event : events())
             out.insert(out.end(), event.begin(), event.end());
         return out;
     }
