@@ -14,13 +14,12 @@
 
 #include "peers/mgmtctl/reasons.h"
 #include "peers/mgmtctl/show_draw.h"
+#include "peers/mgmtctl/show_words.h"
 
 static constexpr int STRIP_CELLS = 64;
 static constexpr int BAR_CELLS = 20;
 
 namespace {
-enum class style { plain, bold, dim, good, warn, bad };
-
 // A line that ends at its last column, whatever is added.
 struct pen {
     const screen_form &form;
@@ -69,96 +68,28 @@ static std::string format(const char *text, ...) {
     return buffer;
 }
 
-std::string duration_text(uint64_t milliseconds) {
-    const uint64_t seconds = milliseconds / 1000, days = seconds / 86400;
-    const std::string days_text = days ? std::to_string(days) + "d " : "";
-    return days_text + format("%" PRIu64 ":%02" PRIu64 ":%02" PRIu64, seconds / 3600 % 24, seconds / 60 % 60,
-                              seconds % 60);
-}
-
-static char letter_of(int place) {
-    return place < 0 ? '-' : static_cast<char>(place < 26 ? 'A' + place : 'a' + place - 26);
-}
-
 static int colour_of(int place) {
     static const int palette[] = {33, 214, 70, 170, 44, 203, 142, 105, 37, 208, 28, 161};
     return place < 0 ? 236 : palette[static_cast<size_t>(place) % std::size(palette)];
 }
 
-static std::string plural(size_t count, const char *what) {
-    return std::to_string(count) + " " + what + (count == 1 ? "" : "s");
-}
+// --- One line
 
-// --- Words
-
-// An alarm's text names the cause where one is known.
 static std::string alarm_words(const snapshot_alarm &alarm, const std::vector<reason> &reasons) {
-    static const struct {
-        const char *name, *words;
-    } known[] = {
-        {"adjacency", "a router is not connected as it should be"},
-        {"assignment", "a router does not share out the traffic as asked"},
-    };
-    const auto *row = std::find_if(std::begin(known), std::end(known),
-                                   [&](const auto &each) { return alarm.name == each.name; });
-    const reason *cause = alarm_reason(reasons, alarm.group, alarm.name, alarm.source);
-    std::string text = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": " : alarm.source + ": ";
-    if (cause && alarm.group < 0)
-        text.clear(); // the cause names its subject
-    text += cause ? cause->cause : row != std::end(known) ? row->words : alarm.text;
+    const std::string about = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": "
+                              // A cause without a group names its subject.
+                              : alarm_reason(reasons, alarm.group, alarm.name, alarm.source)
+                                  ? ""
+                                  : alarm.source + ": ";
+    const std::string text = about + alarm_cause(alarm, reasons);
     return alarm.since.empty() ? text : text + ", since " + alarm.since;
-}
-
-static bool in_alarm(const snapshot &shown, const snapshot_group &group) {
-    return std::any_of(shown.alarms.begin(), shown.alarms.end(),
-                       [&](const snapshot_alarm &alarm) { return alarm.group == group.id; });
-}
-
-static std::pair<std::string, style> state_words(const snapshot &shown, const snapshot_group &group,
-                                                 bool troubled = false) {
-    if (group.admin == "down")
-        return {"admin down", style::dim};
-    if (shown.traffic.left.contains(group.id))
-        return {"left its routers", style::bad};
-    if (!group.running)
-        return {shown.wccpd == wccpd_condition::running ? "not taken by wccpd" : "configured", style::warn};
-    std::string text = group.state + (group.designated ? ", designated" : "");
-    if (!group.configured)
-        text += ", not configured";
-    const bool missing = std::any_of(group.reasons.begin(), group.reasons.end(),
-                                     [](const auto &each) { return each.code == "interface-missing"; });
-    if (missing)
-        return {text + ", no interface", style::bad};
-    if (group.link == "down")
-        return {text + ", link down", style::bad};
-    return {text, group.state == "INIT" || troubled ? style::warn : style::good};
-}
-
-static const snapshot_appliance *own(const snapshot_group &group) {
-    const auto self = std::find_if(group.appliances.begin(), group.appliances.end(),
-                                   [](const snapshot_appliance &one) { return one.self; });
-    return self == group.appliances.end() ? nullptr : &*self;
-}
-
-static std::string share_words(const snapshot_appliance &one) {
-    if (!one.reported)
-        return "-";
-    std::string text = std::to_string(one.least_percent);
-    if (one.most_percent != one.least_percent)
-        text += "-" + std::to_string(one.most_percent);
-    return text + "%";
-}
-
-static size_t connected_routers(const snapshot_group &group) {
-    return static_cast<size_t>(std::count_if(group.routers.begin(), group.routers.end(),
-                                             [](const auto &r) { return r.connection == "two-way"; }));
 }
 
 static std::string one_line(const snapshot_group &group, bool brief) {
     const size_t reached = brief ? group.routers_heard : connected_routers(group);
     const size_t all = brief ? std::max(group.routers_configured, reached) : group.routers.size();
     std::string text = "  routers " + std::to_string(reached) + "/" + std::to_string(all);
-    if (const snapshot_appliance *self = own(group)) {
+    if (const snapshot_appliance *self = own_appliance(group)) {
         text += "  share " + share_words(*self);
         if (self->asked_percent >= 0)
             text += " of " + std::to_string(self->asked_percent) + "%";
@@ -171,7 +102,7 @@ static std::string one_line(const snapshot_group &group, bool brief) {
 static std::string traffic_head(const traffic_state &traffic) {
     if (traffic.tunneld != tunneld_condition::running)
         return traffic.tunneld == tunneld_condition::absent ? "tunneld: no session" : "tunneld: no answer";
-    return "traffic  data plane " + traffic.plane + "  " + plural(traffic.tunnels.size(), "tunnel");
+    return "traffic  data plane " + traffic.plane + "  " + plural_text(traffic.tunnels.size(), "tunnel");
 }
 
 std::vector<std::string> draw_lines(const snapshot &shown) {
@@ -185,7 +116,7 @@ std::vector<std::string> draw_lines(const snapshot &shown) {
     for (const snapshot_alarm &alarm : shown.alarms)
         out.push_back("alarm  " + alarm_words(alarm, reasons));
     for (const snapshot_group &group : shown.groups) {
-        out.push_back("group " + std::to_string(group.id) + "  " + state_words(shown, group).first +
+        out.push_back("group " + std::to_string(group.id) + "  " + group_state_words(shown, group).first +
                       one_line(group, shown.brief));
         if (const reason *cause = main_reason(reasons, group.id))
             out.back() += "  " + cause->code;
@@ -229,22 +160,6 @@ struct screen {
 };
 } // namespace
 
-static std::string group_counts(const snapshot &shown) {
-    size_t active = shown.roles_active, backup = shown.roles_backup;
-    if (!shown.brief) {
-        active = backup = 0;
-        for (const snapshot_group &group : shown.groups) {
-            active += group.state == "ACTIVE";
-            backup += group.state == "BACKUP";
-        }
-    }
-    std::string text = shown.groups_total == 0 ? "no group" : plural(shown.groups_total, "group");
-    if (shown.groups_total != 0 && shown.wccpd == wccpd_condition::running)
-        text += ": " + std::to_string(active) + " active" +
-                (backup ? ", " + std::to_string(backup) + " backup" : "");
-    return text;
-}
-
 static void draw_head(screen *on, size_t alarms_most) {
     const snapshot &shown = on->shown;
     pen line = on->begin();
@@ -260,7 +175,7 @@ static void draw_head(screen *on, size_t alarms_most) {
                                                                         : "wccpd does not answer";
     const std::string counts =
         (shown.mode.empty() ? "" : "   mode " + shown.mode) + "   " + group_counts(shown) + "   ";
-    const std::string alarms = shown.alarms_total ? plural(shown.alarms_total, "alarm")
+    const std::string alarms = shown.alarms_total ? plural_text(shown.alarms_total, "alarm")
                                : running          ? "no alarm"
                                                   : "alarms unknown";
     const std::string version = shown.version.empty() ? "" : " (" + shown.version + ")";
@@ -276,16 +191,17 @@ static void draw_head(screen *on, size_t alarms_most) {
     for (size_t i = 0; i < listed; i++)
         on->text("! " + alarm_words(shown.alarms[i], on->reasons), style::bad);
     if (listed < shown.alarms_total)
-        on->text("! " + plural(shown.alarms_total - listed, "alarm") + (listed ? " more" : ""), style::bad);
+        on->text("! " + plural_text(shown.alarms_total - listed, "alarm") + (listed ? " more" : ""),
+                 style::bad);
 }
 
 static void draw_group_head(screen *on, const snapshot_group &group) {
     pen line = on->begin();
     add_cells(&line, format("%-4d", group.id), style::bold);
     const reason *cause = main_reason(on->reasons, group.id);
-    const auto [words, how] = state_words(on->shown, group, cause != nullptr);
+    const auto [words, how] = group_state_words(on->shown, group, cause != nullptr);
     add_cells(&line, words, how);
-    if (cause || in_alarm(on->shown, group))
+    if (cause || is_in_alarm(on->shown, group))
         add_cells(&line, " !", style::bad);
     std::string text;
     if (group.uptime_ms)
@@ -354,7 +270,7 @@ static void draw_appliance(screen *on, const snapshot_appliance &one, int place)
     pen line = on->begin();
     add_cells(&line, "  ");
     set_style(&line, "1;38;5;" + std::to_string(colour_of(place)));
-    add_cells(&line, std::string(1, letter_of(place)));
+    add_cells(&line, std::string(1, appliance_letter(place)));
     set_style(&line, "0");
     add_cells(&line, format(" %-15s %-4s ", one.address.c_str(), one.self ? "this" : ""));
     add_cells(&line, one.weight < 0 ? format("%-13s", "") : format("weight %-6" PRId64, one.weight));
@@ -387,7 +303,7 @@ static void draw_strip(screen *on, const snapshot_group &group, const snapshot_t
         if (on->form.colour && on->form.utf8)
             add_glyph(&line, "▌", ' ');
         else
-            add_cells(&line, std::string(1, letter_of(left)));
+            add_cells(&line, std::string(1, appliance_letter(left)));
     }
     set_style(&line, "0");
     on->end(&line);
@@ -408,7 +324,7 @@ static std::vector<size_t> chosen(const std::vector<Entry> &all, size_t most, Fi
 
 static void draw_more(screen *on, size_t all, size_t most, const char *what) {
     if (all > most)
-        on->text("  and " + plural(all - most, what) + " more", style::dim);
+        on->text("  and " + plural_text(all - most, what) + " more", style::dim);
 }
 
 static void draw_group(screen *on, const snapshot_group &group, size_t most) {
@@ -462,7 +378,7 @@ static std::vector<std::string> draw_whole(const snapshot &shown, const screen_f
         draw_traffic(&on, most);
     }
     if (shown.groups.size() < shown.groups_total)
-        on.text("and " + plural(shown.groups_total - shown.groups.size(), "group") + " not shown",
+        on.text("and " + plural_text(shown.groups_total - shown.groups.size(), "group") + " not shown",
                 style::dim);
     return std::move(on.lines);
 }
@@ -481,9 +397,9 @@ static std::vector<std::string> draw_briefly(const snapshot &shown, const screen
         pen line = on.begin();
         add_cells(&line, format("%-4d", group.id), style::bold);
         const reason *cause = main_reason(on.reasons, group.id);
-        const auto [words, how] = state_words(shown, group, cause != nullptr);
+        const auto [words, how] = group_state_words(shown, group, cause != nullptr);
         add_cells(&line, format("%-20s", words.c_str()), how);
-        add_cells(&line, cause || in_alarm(shown, group) ? " !" : "  ", style::bad);
+        add_cells(&line, cause || is_in_alarm(shown, group) ? " !" : "  ", style::bad);
         add_cells(&line, group.uptime_ms ? format("  up %-11s", duration_text(group.uptime_ms).c_str()) : "");
         add_cells(&line, one_line(group, shown.brief));
         add_cells(&line, cause ? "  " + cause->code : "", style::warn);
@@ -491,7 +407,7 @@ static std::vector<std::string> draw_briefly(const snapshot &shown, const screen
         drawn++;
     }
     if (drawn < shown.groups_total)
-        on.text("and " + plural(shown.groups_total - drawn, "group") + " not shown", style::dim);
+        on.text("and " + plural_text(shown.groups_total - drawn, "group") + " not shown", style::dim);
     return std::move(on.lines);
 }
 
