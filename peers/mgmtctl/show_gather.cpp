@@ -233,7 +233,7 @@ static bool gather_routers(gathering *work, snapshot_group *group,
             snapshot_router silent;
             silent.address = silent.id = address;
             silent.configured = true;
-            silent.connection = "none";
+            silent.connection = work->shown.wccpd == wccpd_condition::running ? "none" : "unknown";
             group->routers.push_back(silent);
         }
     }
@@ -279,10 +279,14 @@ static void sort_appliances(snapshot_group *group) {
         return address_order(a.address) < address_order(b.address);
     });
     group->appliances.swap(sorted);
-    for (snapshot_table &table : group->tables)
-        for (int &owner : table.owners)
+    const auto renumber = [&](snapshot_table *table) {
+        for (int &owner : table->owners)
             if (owner >= 0)
                 owner = place_of_appliance(group, sorted[static_cast<size_t>(owner)].address);
+    };
+    for (snapshot_table &table : group->tables)
+        renumber(&table);
+    renumber(&group->wanted);
 }
 
 namespace {

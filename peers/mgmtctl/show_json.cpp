@@ -97,6 +97,7 @@ static json group_json(const snapshot_group &group) {
     out["tables"] = json::array();
     for (const snapshot_table &table : group.tables)
         out["tables"].push_back(table_json(group, table));
+    out["wanted_table"] = group.wanted.owners.empty() ? json(nullptr) : table_json(group, group.wanted);
     return out;
 }
 

@@ -72,6 +72,7 @@ struct snapshot_group {
     std::vector<snapshot_router> routers;
     std::vector<snapshot_appliance> appliances;
     std::vector<snapshot_table> tables;
+    snapshot_table wanted; // what this appliance has sent as the designated one; without owners: unknown
 };
 enum class wccpd_condition { running, silent, absent };
 struct snapshot {

@@ -1,10 +1,13 @@
-// Only wccpd's texts say which appliance has which bucket, what the designated appliance allots, and the
-// state of a group's interface.
+// Only wccpd's texts say which appliance has which bucket, what the designated appliance wants and allots,
+// and the state of a group's interface.
 //
-// The texts are rows of a label and a value. Unknown rows are passed over, and a text that was cut gives what
-// came before the cut. Lines, routers, appliances and buckets are bounded by what the engine can have. The
-// words of an assignment are as they were stored: in a hash table the first bucket is in the highest byte of
-// each word, in a mask table in its lowest bit.
+// The texts are rows of a label and a value. Unknown rows are skipped, and a text that was cut gives what
+// came before the cut. Lines, routers, appliances and buckets are bounded by what the engine can have.
+//
+// The words of a table that a router reports are printed as they were stored: in a hash table the first
+// bucket is in the highest byte of each word, in a mask table in its lowest bit. In the designated
+// appliance's own hash table the highest word comes first, and the first bucket is the lowest bit of the last
+// word.
 #include <algorithm>
 #include <bit>
 #include <cstdio>
@@ -59,7 +62,8 @@ struct assignment_reader {
     bool routers = false; // in the part of what they report
     std::string router;
     int place = -1;
-    int words_at = -1; // where the next line of words goes, -1: nowhere
+    int words_at = -1;  // where the next line of words goes, -1: nowhere
+    int wanted_at = -1; // the same in the designated appliance's table: 128 for the first line, then 0
     bool mask = false;
     std::map<std::string, snapshot_table> tables; // by router
 };
@@ -78,13 +82,41 @@ static void put_words(assignment_reader *in, const uint32_t *words) {
     }
 }
 
+static void put_wanted_words(assignment_reader *in, const uint32_t *words) {
+    in->group->wanted.owners.resize(BUCKETS, -1);
+    for (size_t i = 0; i < 128; i++)
+        if (words[3 - i / 32] >> i % 32 & 1)
+            in->group->wanted.owners[static_cast<size_t>(in->wanted_at) + i] = in->place;
+}
+
+// A value of the designated appliance's mask table, and its owner. The values come in their order.
+static bool take_wanted_value(assignment_reader *in, const dump_row &row) {
+    snapshot_table *wanted = &in->group->wanted;
+    char owner[16];
+    if (in->routers || wanted->owners.size() >= BUCKETS ||
+        row.label != std::to_string(wanted->owners.size()) ||
+        sscanf(std::string(row.value.substr(0, 80)).c_str(), "0x%*8x 0x%*8x 0x%*4x 0x%*4x %15[0-9.]",
+               owner) != 1)
+        return false;
+    wanted->mask = true;
+    wanted->owners.push_back(std::string_view(owner) == "0.0.0.0" ? -1
+                                                                  : place_of_appliance(in->group, owner));
+    return true;
+}
+
 static void take_row(assignment_reader *in, const dump_row &row) {
     uint32_t words[4];
-    if (in->words_at >= 0 && row.label.empty() && words_in(row.value, words)) {
+    if (take_wanted_value(in, row))
+        return;
+    if (in->wanted_at >= 0 && row.label.empty() && words_in(row.value, words)) {
+        put_wanted_words(in, words);
+        in->wanted_at -= 128;
+    } else if (in->words_at >= 0 && row.label.empty() && words_in(row.value, words)) {
         put_words(in, words);
         in->words_at = -1;
     } else if (row.label == "Received router allocation") {
         in->routers = true;
+        in->wanted_at = -1;
     } else if (row.label == "Router id") {
         in->router = address_in(row.value);
     } else if (row.label == "Appliance ip") {
@@ -92,6 +124,7 @@ static void take_row(assignment_reader *in, const dump_row &row) {
     } else if (row.label == "Hash/mask allotment" && !in->routers && in->place >= 0) {
         in->group->appliances[static_cast<size_t>(in->place)].asked_percent =
             std::clamp(atoi(std::string(row.value.substr(0, 8)).c_str()), 0, 100);
+        in->wanted_at = 128;
     } else if (row.label == "Rxed hash assignment" || row.label.starts_with("Rxed value buckets")) {
         in->mask = row.label.starts_with("Rxed value");
         in->words_at = 0;
@@ -101,10 +134,19 @@ static void take_row(assignment_reader *in, const dump_row &row) {
     }
 }
 
-// A mask table has as many values as its bits give: up to the last that has an owner, and a power of two.
-static void finish_table(snapshot_table *table) {
+static bool has_owner(const snapshot_table &table) {
+    return std::any_of(table.owners.begin(), table.owners.end(), [](int owner) { return owner >= 0; });
+}
+
+// A mask table has as many values as the wanted one. Where that is unknown, it ends at the last value that
+// has an owner, at a power of two.
+static void finish_table(const snapshot_table &wanted, snapshot_table *table) {
     if (!table->mask)
         return;
+    if (wanted.mask && !wanted.owners.empty()) {
+        table->owners.resize(wanted.owners.size());
+        return;
+    }
     size_t count = table->owners.size();
     while (count > 0 && table->owners[count - 1] < 0)
         count--;
@@ -114,13 +156,13 @@ static void finish_table(snapshot_table *table) {
 void take_assignment_text(const std::string &text, snapshot_group *inout) {
     assignment_reader in = {.group = inout, .router = {}, .tables = {}};
     each_row(text, [&](const dump_row &row) { take_row(&in, row); });
+    if (!has_owner(inout->wanted))
+        inout->wanted = {};
     for (auto &reported : in.tables) {
         const std::string &router = reported.first;
         snapshot_table &table = reported.second; // named, because clang 14 can't capture structured bindings
-        finish_table(&table);
-        const bool owned =
-            std::any_of(table.owners.begin(), table.owners.end(), [](int o) { return o >= 0; });
-        if (!owned)
+        finish_table(inout->wanted, &table);
+        if (!has_owner(table))
             continue;
         auto same = std::find_if(inout->tables.begin(), inout->tables.end(), [&](const snapshot_table &t) {
             return t.mask == table.mask && t.owners == table.owners;
