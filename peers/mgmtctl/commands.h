@@ -16,7 +16,7 @@ enum ctl_exit : int {
     CTL_PARTLY = 5,       // no longer given: every command is one commit
     CTL_WOULD_CHANGE = 1, // apply --check: there is a difference; every failure is 2
     CTL_STANDING = 6,     // alarms --check: an alarm is active
-    CTL_OUTPUT = 7,       // standard output took not all of it
+    CTL_OUTPUT = 7,       // not all of the output could be written
 };
 
 struct ctl_options {
@@ -25,6 +25,7 @@ struct ctl_options {
     bool secrets = false; // passwords are shown
     int colour = -1;      // 1 yes, 0 no, -1 when standard output is a terminal
     int below = 0;        // rows at the top of the terminal that are somebody else's
+    std::string html;     // the file that show writes a page to, "-" for standard output; empty: none
     int64_t timeout_ms = 10'000;
     std::string cause; // of commits, in the history: the word of the command line, with the one after it
 };

@@ -245,6 +245,11 @@ static void add_show_command(command_line *line) {
     CLI::App *command = add_command(line, "show", "the whole appliance in one screen",
                                     [options] { return ctl_show(*options); });
     CLI::Option *stay = command->add_flag("--watch", options->watch, "stay, and follow what changes");
+    command->add_option("--html", options->html, "write it as a page to FILE; - is standard output")
+        ->type_name("FILE")
+        ->check([](const std::string &file) { return file.empty() ? "the name of a file is empty" : ""; })
+        ->excludes(stay)
+        ->excludes(line->app.get_option("--json"));
     command->add_option("--below", options->below, "leave so many rows at the top of the terminal alone")
         ->check(CLI::Range(0, 1000))
         ->needs(stay);

@@ -7,8 +7,11 @@
 // the beginning of each snapshot, because the other program may have moved the cursor in between. In a file
 // or a pipe it is a line, with the time, for whatever has changed, and as JSON one snapshot a line. When
 // mgmtd goes, a live snapshot reports that and tries to reach it once a second.
+//
+// How a snapshot is drawn is a row of the table of renderers.
 #include <algorithm>
 #include <cerrno>
+#include <climits>
 #include <clocale>
 #include <cstdio>
 #include <cstdlib>
@@ -22,24 +25,36 @@
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/commands.h"
+#include "peers/mgmtctl/html_file.h"
 #include "peers/mgmtctl/show_draw.h"
 #include "peers/mgmtctl/show_gather.h"
 #include "runtime/ttime.h"
+#include "runtime/version.h"
 
 static constexpr int64_t PERIOD_MS = 1000;
 static constexpr int64_t BURST_MS = 100; // events within it are one
 static constexpr int FILE_COLUMNS = 120;
 static constexpr size_t SCREEN_BYTES = 1 << 16; // a large screen with its colours
 static constexpr int GROUP_ROWS = 5;            // of the smallest drawing of a group that is more than a line
+static constexpr size_t PAGE_QUERIES = 32768;   // 256 groups with 32 appliances each are 18,000
 
 static volatile std::sig_atomic_t pause_wanted;
 
 namespace {
+struct viewer;
+struct renderer {
+    bool (*is_wanted)(const viewer &self);
+    void (*show)(viewer *self, const snapshot &shown);
+    bool is_screen; // bounded by the terminal's size, and empty without mgmtd
+    size_t queries; // that one snapshot may take
+};
 struct viewer {
     const ctl_options &options;
+    const renderer *how = nullptr;
     bool terminal = false, on_screen = false;
     std::vector<std::string> before; // lines as they were last printed
     bool broken = false;             // nobody reads the output
+    bool unwritten = false;          // the page could not be written
 };
 } // namespace
 
@@ -69,7 +84,8 @@ static screen_form form_of(const viewer &self) {
 
 static snapshot_limits limits_of(const viewer &self) {
     snapshot_limits limits;
-    if (self.terminal && !self.options.json) {
+    limits.queries = self.how->queries;
+    if (self.terminal && self.how->is_screen) {
         const auto rows = static_cast<size_t>(form_of(self).rows);
         limits.detailed = std::max<size_t>(rows / GROUP_ROWS, 1);
         limits.listed = rows;
@@ -123,15 +139,33 @@ static void print_changes(viewer *self, const snapshot &shown) {
     write_out(self, text);
 }
 
-static void show_one(viewer *self, const snapshot &shown) {
-    if (self->options.json) {
-        write_out(self, draw_json(shown) + "\n");
-        return;
+static void show_json(viewer *self, const snapshot &shown) {
+    write_out(self, draw_json(shown) + "\n");
+}
+
+static void show_page(viewer *self, const snapshot &shown) {
+    char made[32], host[HOST_NAME_MAX + 1] = "";
+    page_origin origin;
+    origin.now = time(nullptr);
+    tm parts;
+    localtime_r(&origin.now, &parts);
+    strftime(made, sizeof made, "%Y-%m-%d %H:%M:%S %z", &parts);
+    if (gethostname(host, sizeof host - 1) != 0)
+        strcpy(host, "unknown");
+    origin.host = host;
+    origin.made = made;
+    origin.version = wccp_version();
+    const std::string page = draw_page(shown, origin), &file = self->options.html;
+    std::string reason;
+    if (file == "-") {
+        write_out(self, page);
+    } else if (!write_page_file(file, page, &reason)) {
+        fprintf(stderr, "mgmtctl: %s: %s\n", file.c_str(), reason.c_str());
+        self->unwritten = true;
     }
-    if (self->options.watch && !self->terminal) {
-        print_changes(self, shown);
-        return;
-    }
+}
+
+static void show_screen(viewer *self, const snapshot &shown) {
     screen_form form = form_of(*self);
     if (self->options.watch)
         form.corner = "   " + clock_text();
@@ -146,6 +180,15 @@ static void show_one(viewer *self, const snapshot &shown) {
     }
     write_out(self, text);
 }
+
+// The first that is wanted.
+static const renderer renderers[] = {
+    {[](const viewer &self) { return !self.options.html.empty(); }, show_page, false, PAGE_QUERIES},
+    {[](const viewer &self) { return self.options.json; }, show_json, false, snapshot_limits{}.queries},
+    {[](const viewer &self) { return self.options.watch && !self.terminal; }, print_changes, false,
+     snapshot_limits{}.queries},
+    {[](const viewer &) { return true; }, show_screen, true, snapshot_limits{}.queries},
+};
 
 static snapshot look(const viewer &self, ctl_session *session) {
     return gather_snapshot(
@@ -244,9 +287,9 @@ static int watch(viewer *self) {
         const int64_t cost_ms = lt_monotonic_ms() - began;
         if (ctl_stop_signal)
             break;
-        if (self->terminal && !self->options.json)
+        if (self->terminal && self->how->is_screen)
             take_screen(self, true);
-        show_one(self, shown);
+        self->how->show(self, shown);
         std::string reason;
         if (session && (!shown.unreachable.empty() || !wait_for_news(session, cost_ms, &reason))) {
             ctl_close(session);
@@ -263,9 +306,11 @@ static int watch(viewer *self) {
 }
 
 int ctl_show(const ctl_options &options) {
-    viewer self = {options, false, false, {}, false};
+    viewer self = {options, nullptr, false, false, {}, false, false};
     const char *kind = getenv("TERM");
     self.terminal = isatty(STDOUT_FILENO) && kind && strcmp(kind, "dumb") != 0;
+    self.how = std::find_if(std::begin(renderers), std::end(renderers),
+                            [&](const renderer &each) { return each.is_wanted(self); });
     setlocale(LC_CTYPE, "");
     if (options.watch)
         return watch(&self);
@@ -274,11 +319,12 @@ int ctl_show(const ctl_options &options) {
         shown = look(self, session);
         ctl_close(session);
     }
-    if (shown.unreachable.empty() || options.json)
-        show_one(&self, shown);
-    if (shown.unreachable.empty())
-        return shown.wccpd == wccpd_condition::running ? CTL_OK : CTL_UNREACHABLE;
-    if (!options.json)
+    const bool reached = shown.unreachable.empty();
+    if (reached || !self.how->is_screen)
+        self.how->show(&self, shown);
+    if (!reached && !options.json)
         fprintf(stderr, "mgmtctl: %s\n", shown.unreachable.c_str());
-    return CTL_UNREACHABLE;
+    if (!reached || shown.wccpd != wccpd_condition::running)
+        return CTL_UNREACHABLE;
+    return self.unwritten ? CTL_OUTPUT : CTL_OK;
 }

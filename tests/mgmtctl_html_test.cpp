@@ -1,0 +1,295 @@
+// The page of "mgmtctl show --html": what comes from outside is escaped, what is unknown is called unknown,
+// what needs attention is open, and the file is replaced as a whole. tests/scenario_page.sh shows real pages
+// to a browser.
+#include <gtest/gtest.h>
+
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include <sys/resource.h>
+#include <sys/stat.h>
+
+#include "peers/mgmtctl/html_file.h"
+#include "peers/mgmtctl/show_draw.h"
+#include "peers/mgmtctl/show_texts.h"
+
+namespace {
+const page_origin ORIGIN = {"cache1", "2026-11-25 14:09:55 +0000", "1.0.0", 1795615795};
+
+// A group that works: this appliance is designated, and its routers have the table that it wants.
+snapshot_group good_group(int id, size_t routers = 2, size_t appliances = 2) {
+    snapshot_group group;
+    group.id = id;
+    group.configured = group.running = group.designated = group.interface_set = true;
+    group.state = "ACTIVE";
+    group.admin = "up";
+    group.link = "up";
+    group.address = "10.0.1.0";
+    group.routers_configured = routers;
+    group.wanted.owners.resize(256);
+    for (size_t i = 0; i < appliances; i++) {
+        snapshot_appliance *one = &group.appliances.emplace_back();
+        one->address = "10.0.1." + std::to_string(i);
+        one->self = i == 0;
+        one->weight = 100;
+        one->asked_percent = static_cast<int>(100 / appliances);
+        one->reported = true;
+        one->least_percent = one->most_percent = 100 / static_cast<uint32_t>(appliances);
+    }
+    for (size_t i = 0; i < 256; i++)
+        group.wanted.owners[i] = static_cast<int>(i * appliances / 256);
+    group.tables.push_back(group.wanted);
+    for (size_t i = 0; i < routers; i++) {
+        snapshot_router *router = &group.routers.emplace_back();
+        router->address = router->id = "10.0.0." + std::to_string(i + 1);
+        router->configured = true;
+        router->connection = "two-way";
+        router->forward = router->back = "gre";
+        router->assign = "hash";
+        for (const snapshot_appliance &one : group.appliances)
+            router->loads.push_back({one.address, one.least_percent});
+        group.tables[0].routers.push_back(router->id);
+    }
+    return group;
+}
+
+snapshot good_snapshot(std::vector<snapshot_group> groups) {
+    snapshot shown;
+    shown.wccpd = wccpd_condition::running;
+    shown.status = "Ready";
+    shown.groups_total = groups.size();
+    shown.traffic.tunneld = tunneld_condition::running;
+    shown.traffic.plane = "kernel";
+    for (const snapshot_group &group : groups) {
+        traffic_intercept *one = &shown.traffic.intercepts.emplace_back();
+        one->group = group.id;
+        one->proxy = "up";
+        one->flows = 3;
+    }
+    shown.groups = std::move(groups);
+    return shown;
+}
+
+size_t count_of(const std::string &text, const std::string &wanted) {
+    size_t count = 0;
+    for (size_t at = 0; (at = text.find(wanted, at)) != std::string::npos; at += wanted.size())
+        count++;
+    return count;
+}
+
+bool has(const std::string &page, const std::string &text) {
+    return page.find(text) != std::string::npos;
+}
+
+std::string content_of(const std::string &path) {
+    std::ostringstream out;
+    out << std::ifstream(path).rdbuf();
+    return out.str();
+}
+} // namespace
+
+TEST(Html, WhatComesFromOutsideIsEscaped) {
+    const std::string evil = "\"'><script>&amp;";
+    snapshot_group group = good_group(51);
+    for (std::string *text :
+         {&group.interface, &group.protocol, &group.encap, &group.assign_method, &group.address, &group.link,
+          &group.state, &group.routers[0].address, &group.routers[0].id, &group.routers[0].forward,
+          &group.routers[0].assign, &group.routers[0].back, &group.appliances[1].address,
+          &group.tables[0].routers[0]})
+        *text = evil;
+    group.reasons.push_back({evil, evil, evil, evil, 4, 1, 1});
+    snapshot shown = good_snapshot({group});
+    shown.alarms.push_back({1, evil, evil, evil, evil, evil, -1});
+    shown.alarms_total = 1;
+    shown.reasons = group.reasons;
+    traffic_state *traffic = &shown.traffic;
+    traffic_tunnel tunnel;
+    tunnel.local = tunnel.remote = tunnel.interface = evil;
+    tunnel.refused = {{evil, 3}};
+    traffic->tunnels.push_back(tunnel);
+    traffic->intercepts[0].proxy_reason = evil;
+    traffic->refused = tunnel.refused;
+    traffic->refused_sources = {{evil, 2}};
+    traffic->accepted = {{evil + "2", evil}};
+    traffic->left = {{51, evil}};
+    traffic->drains.push_back({51, evil, 3, 0});
+    traffic->protection.time = 300;
+    traffic->protection.groups = {{51, false, evil, 0}};
+    traffic->protection.members[evil] = {};
+    for (std::string *text : {&shown.status, &shown.version, &shown.mode, &traffic->plane,
+                              &traffic->plane_reason, &traffic->lack, &traffic->failure})
+        *text = evil;
+    const page_origin origin = {evil, evil, evil, 0};
+    std::string page = draw_page(shown, origin);
+    for (const char *proxy : {"up", "down", evil.c_str()}) {
+        shown.traffic.intercepts[0].proxy = proxy;
+        page += draw_page(shown, origin);
+    }
+    shown.unreachable = evil;
+    page += draw_page(shown, origin);
+    EXPECT_GT(count_of(page, "&quot;&#39;&gt;&lt;script&gt;&amp;amp;"), 100u);
+    EXPECT_FALSE(has(page, "<script") || has(page, "'><") || has(page, ";&amp;\""));
+    EXPECT_EQ(count_of(page, "\"'"), 0u);
+}
+
+TEST(Html, WhatIsUnknownIsCalledUnknown) {
+    snapshot shown;
+    shown.wccpd = wccpd_condition::silent;
+    shown.traffic.tunneld = tunneld_condition::absent;
+    shown.groups_total = 1;
+    shown.groups.resize(1);
+    shown.groups[0].configured = shown.groups[0].interface_set = true;
+    shown.groups[0].routers_configured = 1;
+    shown.groups[0].routers.resize(1);
+    shown.groups[0].routers[0].address = shown.groups[0].routers[0].id = "10.0.0.1";
+    shown.groups[0].routers[0].connection = "unknown";
+    std::string page = draw_page(shown, ORIGIN);
+    for (const char *text :
+         {"<h1>wccpd does not answer</h1>", "> state unknown</span>",
+          "<dt>Alarms</dt><dd><span class=\"badge unknown\">",
+          "<dt>Flows</dt><dd><span class=\"badge unknown\">", "tunneld has no session",
+          "<code>wccpd-silent</code>", "cache1", "2026-11-25 14:09:55 +0000", "mgmtctl 1.0.0"})
+        EXPECT_TRUE(has(page, text)) << text;
+    for (const char *text : {"nothing heard", "none reported", "no router has", "Nothing needs", "none:"})
+        EXPECT_FALSE(has(page, text)) << text;
+
+    // The table of a designated appliance elsewhere, and a weight that nobody has reported.
+    shown = good_snapshot({good_group(51)});
+    shown.groups[0].designated = false;
+    shown.groups[0].wanted = {};
+    shown.groups[0].appliances[1].weight = -1;
+    page = draw_page(shown, ORIGIN);
+    EXPECT_TRUE(has(page, "only the designated appliance knows it"));
+    EXPECT_TRUE(has(page, "10.0.1.1</td><td><span class=\"badge unknown\">"));
+    EXPECT_FALSE(has(page, "as wanted"));
+
+    shown = {};
+    shown.unreachable = "mgmtd is not running";
+    page = draw_page(shown, ORIGIN);
+    EXPECT_TRUE(has(page, "<h1>mgmtd does not answer</h1>") && has(page, "<code>mgmtd-unreachable</code>"));
+    EXPECT_FALSE(has(page, "<dt>") || has(page, "<h2>Traffic"));
+}
+
+TEST(Html, GroupsThatNeedAttentionAreOpenAndFirst) {
+    std::vector<snapshot_group> groups;
+    for (int id = 1; id <= 6; id++)
+        groups.push_back(good_group(id));
+    snapshot shown = good_snapshot(groups);
+    std::string page = draw_page(shown, ORIGIN);
+    EXPECT_TRUE(has(page, "<h1>Nothing needs attention</h1>"));
+    EXPECT_EQ(count_of(page, "<details>"), 6u);
+
+    shown.groups[1].reasons.push_back({"password-mismatch", "10.0.0.1", "", "", 4, 70000, 3000});
+    shown.groups[3].tables[0].owners[40] = 1;
+    shown.alarms.push_back(
+        {196638, "adjacency", "eth0:grp:6", "raised", "2026/11/25 00:10:11", "wccpd-1", 6});
+    shown.alarms_total = 1;
+    page = draw_page(shown, ORIGIN);
+    EXPECT_TRUE(has(page, "<h1>3 of 6 groups need attention</h1>"));
+    EXPECT_EQ(count_of(page, "<details open>"), 3u);
+    EXPECT_EQ(count_of(page, "<details>"), 3u);
+    EXPECT_LT(page.find("id=\"group-6\""), page.find("id=\"group-1\""));
+    EXPECT_TRUE(has(page, "10.0.0.1 signs its messages with another password"));
+    EXPECT_TRUE(has(page, "set the same one on both: mgmtctl group set 2 password -"));
+}
+
+TEST(Html, ATableIsComparedBucketByBucket) {
+    snapshot_group group = good_group(51, 3);
+    group.tables.push_back(group.tables[0]);
+    group.tables[0].routers = {"10.0.0.1", "10.0.0.3"};
+    group.tables[1].routers = {"10.0.0.2"};
+    for (size_t i = 40; i < 56; i++)
+        group.tables[1].owners[i] = i < 44 ? -1 : 1;
+    snapshot shown = good_snapshot({group});
+    std::string page = draw_page(shown, ORIGIN);
+    for (const char *text :
+         {"16 buckets not as wanted", "title=\"bucket 40: nobody, wanted: A 10.0.1.0\"><i>-</i>",
+          "class=\"o1 other\" title=\"bucket 55: B 10.0.1.1, wanted: A 10.0.1.0\"><i>B</i>",
+          "aria-label=\"A 112, B 140, nobody 4\""})
+        EXPECT_TRUE(has(page, text)) << text;
+    const size_t legend = 4;
+    EXPECT_EQ(count_of(page, "<i>"), 3 * 256u + 2 + legend);
+    // With many groups, a run of buckets has one title.
+    shown = good_snapshot(std::vector<snapshot_group>(17, group));
+    page = draw_page(shown, ORIGIN);
+    EXPECT_EQ(count_of(page, "<i>"), 17 * (3 * 256u + 2) + legend);
+    EXPECT_EQ(count_of(page, "title=\"buckets 44 to 55: B 10.0.1.1, wanted: A 10.0.1.0\""), 17u);
+    // All that an appliance can have: 256 groups, each with 32 routers and 8 appliances.
+    std::vector<snapshot_group> all;
+    for (int id = 0; id < 256; id++)
+        all.push_back(good_group(id, 32, 8));
+    EXPECT_LT(draw_page(good_snapshot(all), ORIGIN).size(), 6u << 20);
+}
+
+TEST(Html, TheDesignatedAppliancesTableIsReadFromItsText) {
+    snapshot_group group;
+    take_assignment_text("\tAppliance ip               : 10.0.0.101\n\tHash/mask allotment        : 50 % \n"
+                         "\t                           : 0x00000000 00000000 00000000 00000000\n"
+                         "\t                           : 0x00000000 00000000 00000000 ffff0001\n"
+                         "\tAppliance ip               : 10.0.0.102\n\tHash/mask allotment        : 50 % \n"
+                         "\t                           : 0x80000000 00000000 00000000 00000000\n"
+                         "\t                           : 0x00000000 00000000 00000000 00000000\n"
+                         "\tReceived router allocation\n",
+                         &group);
+    ASSERT_EQ(group.wanted.owners.size(), 256u);
+    EXPECT_EQ(group.wanted.owners[0], 0);
+    EXPECT_EQ(group.wanted.owners[1], -1);
+    EXPECT_EQ(group.wanted.owners[16], 0);
+    EXPECT_EQ(group.wanted.owners[255], 1);
+
+    std::string mask = "\tAppliance ip               : 10.0.0.101\n\tHash/mask allotment        : 50 % \n"
+                       "\t         0 : 0x00000003 0x00000000 0x0000   0x0000\n";
+    for (const char *row : {"0 : 0x00000000 0x00000000 0x0000   0x0000   10.0.0.101",
+                            "1 : 0x00000001 0x00000000 0x0000   0x0000   10.0.0.102",
+                            "2 : 0x00000002 0x00000000 0x0000   0x0000   0.0.0.0",
+                            "3 : 0x00000003 0x00000000 0x0000   0x0000   10.0.0.101"})
+        mask += std::string("\t         ") + row + "\n";
+    snapshot_group by_mask;
+    take_assignment_text(mask + "\tReceived router allocation\n\tRouter id                  : 10.0.0.1\n"
+                                "\tAppliance ip               : 10.0.0.102\n"
+                                "\tRxed value buckets (0-127) : 0x00000002 00000000 00000000 00000000\n",
+                         &by_mask);
+    EXPECT_TRUE(by_mask.wanted.mask);
+    EXPECT_EQ(by_mask.wanted.owners, (std::vector<int>{0, 1, -1, 0}));
+    ASSERT_EQ(by_mask.tables.size(), 1u);
+    EXPECT_EQ(by_mask.tables[0].owners, (std::vector<int>{-1, 1, -1, -1})) << "as many values as are wanted";
+}
+
+TEST(Html, AFileIsReplacedAsAWholeOrNotAtAll) {
+    const std::string directory = testing::TempDir() + "/page", file = directory + "/page.html",
+                      link = directory + "/link";
+    std::filesystem::remove_all(directory);
+    std::filesystem::create_directory(directory);
+    std::string reason;
+    umask(027);
+    ASSERT_TRUE(write_page_file(file, "old", &reason)) << reason;
+    struct stat about;
+    ASSERT_EQ(stat(file.c_str(), &about), 0);
+    EXPECT_EQ(about.st_mode & 07777, 0640u);
+    chmod(file.c_str(), 0604);
+    std::filesystem::create_symlink("page.html", link);
+    ASSERT_TRUE(write_page_file(link, "new", &reason)) << reason;
+    EXPECT_TRUE(std::filesystem::is_symlink(link));
+    ASSERT_EQ(stat(file.c_str(), &about), 0);
+    EXPECT_EQ(about.st_mode & 07777, 0604u);
+
+    signal(SIGXFSZ, SIG_IGN);
+    rlimit before, small;
+    getrlimit(RLIMIT_FSIZE, &before);
+    small = before;
+    small.rlim_cur = 1000;
+    setrlimit(RLIMIT_FSIZE, &small);
+    EXPECT_FALSE(write_page_file(file, std::string(5000, 'x'), &reason));
+    setrlimit(RLIMIT_FSIZE, &before);
+    EXPECT_EQ(reason, "File too large");
+    EXPECT_EQ(content_of(file), "new");
+    for (const char *other : {"/dev/null", directory.c_str()}) {
+        EXPECT_FALSE(write_page_file(other, "x", &reason));
+        EXPECT_TRUE(has(reason, "is not a regular file")) << reason;
+    }
+    EXPECT_FALSE(write_page_file(directory + "/none/page.html", "x", &reason));
+    EXPECT_EQ(std::distance(std::filesystem::directory_iterator(directory), {}), 2)
+        << "nothing is left beside";
+}
