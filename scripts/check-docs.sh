@@ -61,7 +61,7 @@ check_words() { # DOCUMENT
         done
     # Removed before the check: separator lines, a second command, and names and files that the operator chooses.
     done < <(quotations "$1" | grep -oP '(^ *|[#$;&] |sudo )mgmtctl \K[^<>#"()]+' |
-        sed -E 's/---.*//; s/[;&|] *[a-z].*//; s/\b(interface|name|password) [a-z][a-z0-9.]*/\1/g; s/ [^ ]+\.(conf|json)\b//g; s/:.*//' | sort -u)
+        sed -E 's/---.*//; s/[;&|] *[a-z].*//; s/\b(interface|name|password) [a-z][a-z0-9.]*/\1/g; s/ [^ ]+\.(conf|json|html)\b//g; s/:.*//' | sort -u)
 }
 
 check_option() { # DOCUMENT PROGRAM OPTION

@@ -1,16 +1,17 @@
 #!/bin/bash
-# install-deps.sh WHAT...: installs the missing packages for `build`, `lab`, `capture`, `test`, `package`, `vm`, on Debian 12, as
-# root or with sudo.
+# install-deps.sh WHAT...: installs the missing packages for `build`, `lab`, `capture`, `test`, `browser`, `package`, `vm`, on
+# Debian 12, as root or with sudo.
 set -eu
 build="g++ cmake ninja-build pkg-config libevent-dev libnuma-dev libmd-dev libnl-route-3-dev libnftables-dev libcli11-dev nlohmann-json3-dev"
 lab="iproute2 util-linux procps mount jq nftables haproxy curl"
 package="debhelper dpkg-dev lintian systemd"
 capture="tcpdump tshark"
 test="libgtest-dev libbenchmark-dev clang-14 lld libclang-rt-14-dev clang-format-14 clang-tidy-14 git $capture"
+browser="chromium" # 110 MB to download
 vm="qemu-system-x86 e2fsprogs"
 wanted=
 for what in "$@"; do
-    case $what in build | lab | capture | test | package | vm) wanted="$wanted ${!what}" ;; *) echo "install-deps.sh: unknown word $what" >&2; exit 2 ;; esac
+    case $what in build | lab | capture | test | browser | package | vm) wanted="$wanted ${!what}" ;; *) echo "install-deps.sh: unknown word $what" >&2; exit 2 ;; esac
 done
 missing=
 for package in $wanted; do

@@ -142,9 +142,14 @@ static void add_wanted_strip(std::string *out, const html_view &view, const snap
 }
 
 static void add_strips(std::string *out, const html_view &view, const snapshot_group &group) {
-    const bool mask =
-        group.wanted.owners.empty() ? !group.tables.empty() && group.tables[0].mask : group.wanted.mask;
-    add_html(out, "<h3>", mask ? "Mask values" : "Hash buckets", "</h3><div class=\"strips\">\n");
+    const snapshot_table *any = !group.wanted.owners.empty() ? &group.wanted
+                                : !group.tables.empty()      ? &group.tables[0]
+                                                             : nullptr;
+    add_html(out, "<h3>",
+             !any        ? "Buckets"
+             : any->mask ? "Mask values"
+                         : "Hash buckets",
+             "</h3><div class=\"strips\">\n");
     add_wanted_strip(out, view, group);
     for (const size_t place : order_of_tables(group)) {
         const snapshot_table &table = group.tables[place];
@@ -182,6 +187,11 @@ static html_markup table_badge(const snapshot_group &group, const snapshot_route
         std::find_if(group.tables.begin(), group.tables.end(), [&](const snapshot_table &each) {
             return std::find(each.routers.begin(), each.routers.end(), router.id) != each.routers.end();
         });
+    const bool misread = std::any_of(group.reasons.begin(), group.reasons.end(), [&](const auto &each) {
+        return each.code == "method-differs" && (each.sender == router.id || each.sender == router.address);
+    });
+    if (table == group.tables.end() && misread)
+        return badge(style::warn, "by another method");
     if (table == group.tables.end())
         return router.connection == "none" ? html_of("<span class=\"dim\">-</span>")
                : group.running && router.connection != "unknown"
@@ -278,7 +288,8 @@ static style proxy_style(const traffic_intercept &intercept) {
 static void add_summary(std::string *out, const html_view &view, const snapshot_group &group) {
     const reason *cause = main_reason(view.reasons, group.id);
     const auto [words, how] = group_state_words(view.shown, group, cause != nullptr);
-    const bool silent = view.shown.wccpd != wccpd_condition::running && group.admin != "down";
+    const bool silent =
+        !group.running && view.shown.wccpd != wccpd_condition::running && group.admin != "down";
     add_html(out, "<summary><span class=\"id\">Group ", group.id, "</span> ",
              silent ? html_of("<span class=\"badge unknown\"><span>?</span> state unknown</span>")
                     : badge(how, words));

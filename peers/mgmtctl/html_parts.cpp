@@ -161,11 +161,12 @@ a{color:inherit}
 .tiles{display:grid;grid-template-columns:repeat(8,1fr);gap:.5rem;margin:.8rem 0 0;padding:0}
 .tiles div{background:var(--card);border:1px solid var(--line);border-radius:10px;padding:.5rem .7rem}
 .tiles dt{color:var(--dim);font-size:.8rem}
-.tiles dd{margin:0;font-size:1.15rem;font-weight:600;line-height:1.3}
+.tiles dd{margin:0;font-size:1.1rem;font-weight:600;line-height:1.3}
 .tiles dd small{display:block;font-size:.8rem;font-weight:400;color:var(--dim)}
 .badge{display:inline-block;border-radius:.8rem;padding:.05rem .6rem;font-size:.88em;font-weight:600;background:var(--note-bg);max-width:100%}
 .badge.good{background:var(--good-bg)}.badge.warn{background:var(--warn-bg)}.badge.bad{background:var(--bad-bg)}
-.badge.unknown{background:none;border:1px dashed var(--dim);color:var(--dim);font-weight:400}
+.badge.unknown{background:none;border:1px dashed var(--dim);color:var(--dim);font-weight:400;white-space:nowrap}
+.tiles .badge{font-size:.8rem;padding:0 .5rem}
 .reason{display:flex;gap:.6rem;background:var(--note-bg);border-radius:8px;padding:.5rem .8rem;margin:.45rem 0;color:var(--text)}
 .reason.warn{background:var(--warn-bg)}
 .reason p{margin:0}
