@@ -141,6 +141,8 @@ const mon_dump assignment_dump = {
     [](csys_display_buf *b, uint8_t g) { return wccp_print_service_grp_assignment_details(g, b); }, false};
 const mon_dump metrics_dump = {
     WCCP_METRICS_BYTES, [](csys_display_buf *b, uint8_t g) { return wccp_print_metrics(g, b); }, false};
+const mon_dump global_metrics_dump = {
+    WCCP_METRICS_BYTES, [](csys_display_buf *b, uint8_t) { return wccp_print_global_metrics(b); }, false};
 const mon_dump owners_dump = {WCCP_OWNERS_BYTES,
                               [](csys_display_buf *b, uint8_t g) { return wccp_print_owners(g, b); }, false};
 
@@ -200,6 +202,7 @@ const mon_node mon_nodes[] = {
     {NODE_GROUP_STATE "/*/debug", bn_type_str, nullptr, &group_dump},
     {NODE_GROUP_STATE "/*/assignment", bn_type_str, nullptr, &assignment_dump},
     {NODE_GROUP_STATE "/*/metric/all", bn_type_str, nullptr, &metrics_dump},
+    {NODE_WCCPD_STATE "/metric/all", bn_type_str, nullptr, &global_metrics_dump},
     {NODE_GROUP_STATE "/*/owners", bn_type_str, nullptr, &owners_dump},
     {NODE_WCCPD_STATE "/debug_global", bn_type_str, nullptr, &global_dump},
     {NODE_WCCPD_STATE "/debug_all", bn_type_str, nullptr, &all_dump},

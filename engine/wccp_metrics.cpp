@@ -8,15 +8,33 @@
 
 namespace {
 
-int print_group_numbers(const wccp_service_group *group, wccp_piece *piece) {
-    const bool timed = (group->state_flags & (WCCP_STATE_ACTIVE | WCCP_STATE_BACKUP)) != 0;
-    wccp_piece_add(piece, "group %d %d %u %u %u %u\n", (group->state_flags & WCCP_STATE_ACTIVE) != 0,
-                   group->designated == 1, timed ? wccp_g.seconds - group->state_time : 0,
-                   group->sending_router_count, group->appliance_view_count, group->pending_acks);
-    return wccp_piece_flush(piece);
-}
+constexpr struct {
+    const char *word;
+    uint32_t (*value)(const wccp_service_group *group);
+} gauges[] = {
+    {"enabled",
+     [](const wccp_service_group *group) -> uint32_t { return group->admin_state == WCCP_ADMIN_UP; }},
+    {"active",
+     [](const wccp_service_group *group) -> uint32_t {
+         return (group->state_flags & WCCP_STATE_ACTIVE) != 0;
+     }},
+    {"designated", [](const wccp_service_group *group) -> uint32_t { return group->designated == 1; }},
+    {"uptime_seconds",
+     [](const wccp_service_group *group) -> uint32_t {
+         const bool timed = (group->state_flags & (WCCP_STATE_ACTIVE | WCCP_STATE_BACKUP)) != 0;
+         return timed ? wccp_g.seconds - group->state_time : 0;
+     }},
+    {"weight", [](const wccp_service_group *group) -> uint32_t { return group->weight; }},
+    {"configured_routers",
+     [](const wccp_service_group *group) -> uint32_t { return group->ucast_router_count; }},
+    {"routers", [](const wccp_service_group *group) { return group->sending_router_count; }},
+    {"appliances", [](const wccp_service_group *group) { return group->appliance_view_count; }},
+    {"pending_acks", [](const wccp_service_group *group) -> uint32_t { return group->pending_acks; }},
+};
 
-int print_counters(const wccp_service_group *group, wccp_piece *piece) {
+int print_group_numbers(const wccp_service_group *group, wccp_piece *piece) {
+    for (const auto &gauge : gauges)
+        wccp_piece_add(piece, "gauge %s %u\n", gauge.word, gauge.value(group));
     for (uint32_t i = 0; wccp_counter_word(i); i++)
         wccp_piece_add(piece, "counter %s %u\n", wccp_counter_word(i), wccp_read_counter(group, i));
     return wccp_piece_flush(piece);
@@ -30,6 +48,7 @@ int print_router_numbers(const wccp_sending_router *router, wccp_piece *piece) {
     return wccp_piece_flush(piece);
 }
 
+// Of a group, or for null of no group.
 int print_reasons(wccp_service_group *group, wccp_piece *piece) {
     uint32_t places;
     const wccp_reason *const table = wccp_reasons_of(group, &places);
@@ -54,7 +73,6 @@ int wccp_print_metrics(int id, csys_display_buf *buffer) {
         return 1;
     wccp_piece piece = wccp_assignment_piece(buffer);
     WCCP_BAIL_ON_ZERO(print_group_numbers(group, &piece));
-    WCCP_BAIL_ON_ZERO(print_counters(group, &piece));
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)
         WCCP_BAIL_ON_ZERO(print_router_numbers(router, &piece));
     for (const wccp_view_appliance *member = group->appliance_view; member; member = member->next) {
@@ -62,4 +80,25 @@ int wccp_print_metrics(int id, csys_display_buf *buffer) {
         WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
     }
     return print_reasons(group, &piece);
+}
+
+int wccp_print_global_metrics(csys_display_buf *buffer) {
+    if (!buffer)
+        return 1;
+    const wccp_engine_lock lock;
+    wccp_piece piece = wccp_assignment_piece(buffer);
+    wccp_piece_add(&piece,
+                   "counter rx_failures %u\ncounter allocations %u\ncounter frees %u\n"
+                   "counter allocation_failures %u\n",
+                   wccp_g.rx_failures, wccp_g.stat_allocs.load(), wccp_g.stat_frees.load(),
+                   wccp_g.stat_alloc_fails.load());
+    WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
+    for (uint32_t i = 0; i < wccp_g.if_count; i++) {
+        const wccp_interface *of = &wccp_g.interfaces[i];
+        wccp_piece_add(&piece, "interface %.*s %d %u %u %u %u\n", static_cast<int>(sizeof of->name), of->name,
+                       of->ready_flags == WCCP_ALL_READY, of->start_count, of->stop_count,
+                       of->link_down_count, of->ipa_change_count);
+        WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
+    }
+    return print_reasons(nullptr, &piece);
 }

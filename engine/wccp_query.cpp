@@ -248,6 +248,9 @@ constexpr struct {
     {"tx_link_drops", &wccp_service_group::tx_link_drops},
     {"routers_timed_out", &wccp_service_group::routers_timed_out},
     {"transitions", &wccp_service_group::transitions},
+    {"view_changes", &wccp_service_group::change_number},
+    {"adjacency_checks", &wccp_service_group::alarm_router_sched},
+    {"assignment_checks", &wccp_service_group::alarm_assign_sched},
 };
 
 } // namespace

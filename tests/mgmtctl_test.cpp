@@ -18,7 +18,6 @@
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/check.h"
 #include "peers/mgmtctl/config_change.h"
-#include "peers/mgmtctl/metrics.h"
 #include "peers/mgmtctl/nodes.h"
 #include "peers/mgmtctl/render.h"
 #include "peers/mgmtctl/watch.h"
@@ -289,61 +288,6 @@ static tree sample() {
              {STATES + "/51/appliance/1/ipaddr", "ipv4addr", "10.0.0.101"},
              {STATES + "/51/appliance/1/weight", "uint32", "5"},
              {STATES + "/51/appliance/2/ipaddr", "ipv4addr", "10.0.0.102"}}};
-}
-
-// --- Metrics
-
-// Numbers from outside stay numbers, texts stay within their labels, and a daemon that is gone is said to be.
-TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
-    tree known = {
-        {{NODE_WCCPD_VERSION, "string", "1.0.0"},
-         {STATES + "/51", "string", "51"},
-         {STATES + "/51/metric/all", "string",
-          "group 1 0 12 1 2 x\ncounter rx_icus 5\ncounter Bad{} 5\nrouter 10.0.0.1 10.0.0.9 1 3 40 128 256\n"
-          "router 10.0.0.2\nnothing 1\nreason password-mismatch 10.0.0.1 7 2\n"},
-         {NODE_PLANE_STATE "/name", "string", "user"},
-         {NODE_PLANE_STATE "/refused/source", "uint64", "4"},
-         {NODE_TUNNEL_STATE "/232", "uint16", "232"},
-         {NODE_TUNNEL_STATE "/232/remote", "ipv4addr", "10.0.0.1"},
-         {NODE_TUNNEL_STATE "/232/to_proxy_bytes", "uint64", "99"},
-         {NODE_INTERCEPT_STATE "/51", "uint8", "51"},
-         {NODE_INTERCEPT_STATE "/51/proxy", "string", "unknown"},
-         {NODE_INTERCEPT_STATE "/51/proxy_ms", "uint64", "1500"},
-         {NODE_ALARMS_RAISED "/196638/a\"b\\\\c", "string", "text"},
-         {NODE_PROCESSES "/wccpd", "string", "running"},
-         {NODE_PROCESSES "/wccpd/restarts", "uint32", "2"}}};
-    std::vector<metric_sample> samples;
-    ASSERT_TRUE(gather_metrics(std::ref(known), &samples));
-    const std::string modern = "\n" + metrics_text(samples, metric_format::openmetrics);
-    for (const char *line :
-         {"wccp_build_info{version=\"1.0.0\"} 1", "wccp_group_uptime_seconds{group=\"51\"} 12",
-          "wccp_group_rx_icus_total{group=\"51\"} 5", "# TYPE wccp_group_rx_icus counter",
-          "# UNIT wccp_group_uptime_seconds seconds",
-          "wccp_router_own_buckets{group=\"51\",router=\"10.0.0.1\",address=\"10.0.0.9\"} 128",
-          "wccp_reason_occurrences{group=\"51\",reason=\"password-mismatch\",sender=\"10.0.0.1\"} 7",
-          "wccp_gre_refused_packets_total{reason=\"source\"} 4",
-          "wccp_tunnel_info{tunnel=\"232\",router=\"10.0.0.1\",interface=\"\"} 1",
-          "wccp_tunnel_sorted_bytes_total{tunnel=\"232\",way=\"to_proxy\"} 99",
-          "wccp_proxy_state_seconds{group=\"51\"} 1.500", "wccp_process_restarts_total{process=\"wccpd\"} 2",
-          "wccp_daemon_up{daemon=\"tunneld\"} 1"})
-        EXPECT_NE(modern.find("\n" + std::string(line) + "\n"), std::string::npos)
-            << line << " in " << modern;
-    for (const char *none : {"pending_acks{", "Bad", "nothing", "wccp_proxy_up{", "router=\"10.0.0.2\""})
-        EXPECT_EQ(modern.find(none), std::string::npos) << none;
-    EXPECT_NE(modern.find("source=\"a\\\"b"), std::string::npos) << modern;
-    EXPECT_TRUE(modern.ends_with("\n# EOF\n"));
-    EXPECT_NE(metrics_text(samples, metric_format::text).find("# TYPE wccp_group_rx_icus_total counter\n"),
-              std::string::npos);
-
-    tree empty;
-    samples.clear();
-    ASSERT_TRUE(gather_metrics(std::ref(empty), &samples));
-    EXPECT_NE(metrics_text(samples, metric_format::text).find("wccp_daemon_up{daemon=\"wccpd\"} 0\n"),
-              std::string::npos);
-    samples.clear();
-    const ctl_ask silent = [](ctl_walk, const std::string &, ctl_reply *) { return false; };
-    EXPECT_FALSE(gather_metrics(silent, &samples));
-    EXPECT_EQ(samples.size(), 1u);
 }
 
 TEST(Names, AreCompletedToTheirNextPart) {

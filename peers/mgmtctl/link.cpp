@@ -26,6 +26,10 @@ ctl_link link_to_mgmtd(const ctl_options &options) {
     link.query = [held](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
         return held->open(out_reason) && ctl_query(held->session, walk, name, out, out_reason);
     };
+    link.query_all = [held](ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out,
+                            std::string *out_reason) {
+        return held->open(out_reason) && ctl_query_all(held->session, walk, names, out, out_reason);
+    };
     const ctl_order order = {options.cause};
     link.set = [held, order](const std::vector<ctl_change_item> &items, ctl_reply *out,
                              std::string *out_reason) {

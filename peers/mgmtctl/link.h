@@ -11,6 +11,9 @@
 struct ctl_link {
     std::function<bool(ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason)>
         query;
+    std::function<bool(ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out,
+                       std::string *out_reason)>
+        query_all;
     std::function<bool(const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *out_reason)>
         set;
     std::function<bool(const std::string &name, const std::vector<ctl_binding> &bindings, ctl_reply *out,

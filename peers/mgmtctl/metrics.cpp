@@ -1,35 +1,34 @@
-// Metrics are made of state nodes by a table: each row says which node becomes which sample. What wccpd has
-// of a group comes in one text for each group, since thousands of routers would be tens of thousands of
-// nodes.
+// Metrics are made of state nodes by tables: each row says which node, or which word of a text, becomes which
+// sample. What wccpd has of a group comes in one text for each group, since thousands of routers would be
+// tens of thousands of nodes, and many groups are asked for at once.
+//
+// A sample becomes a line of text as soon as it is known: a large appliance has 50,000 of them.
 #include "peers/mgmtctl/metrics.h"
 
 #include <algorithm>
-#include <cstring>
+#include <charconv>
 #include <map>
-#include <sstream>
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/render.h"
 #include "peers/mgmtctl/show_model.h"
-#include "runtime/common.h"
 
 namespace {
 
-constexpr size_t LABEL_MAX = 200, GROUPS_MAX = 256, LINES_MAX = 400; // of a group's text
+constexpr size_t LABEL_MAX = 200, GROUPS_MAX = 256, LINES_MAX = 400; // of a text
+constexpr size_t GROUPS_AT_ONCE = 32; // in one request: the answer is at most 400 KB
+constexpr size_t WORDS_MAX = 8;       // of a line
 
 // The value of a sample by the text of its node; false: the node gives none.
 using metric_value = bool (*)(const std::string &text, std::string *out_value);
 
 struct metric_row {
-    const char *node; // "*" are the labels, in the order of `labels`
-    const char *labels;
-    metric_kind kind;
-    const char *family;
-    const char *help;
+    const char *node; // each "*" is one of the family's labels, in their order
+    size_t family;
     metric_value value;
 };
 
-bool is_count(const std::string &text) {
+bool is_count(std::string_view text) {
     return !text.empty() && text.size() <= 20 &&
            std::all_of(text.begin(), text.end(), [](char c) { return c >= '0' && c <= '9'; });
 }
@@ -38,15 +37,12 @@ bool take_count(const std::string &text, std::string *out) {
     *out = text;
     return is_count(text);
 }
-bool take_milliseconds(const std::string &text, std::string *out) {
-    if (!is_count(text))
-        return false;
-    const uint64_t ms = number_of<uint64_t>(text, 0);
-    char value[40];
-    snprintf(value, sizeof value, "%llu.%03u", static_cast<unsigned long long>(ms / 1000),
-             static_cast<unsigned>(ms % 1000));
-    *out = value;
-    return true;
+// With a decimal point before the last `digits` digits.
+template <size_t digits>
+bool take_fraction(const std::string &text, std::string *out) {
+    *out = text.size() > digits ? text : std::string(digits + 1 - text.size(), '0') + text;
+    out->insert(out->size() - digits, ".");
+    return is_count(text);
 }
 bool take_flag(const std::string &text, std::string *out) {
     *out = text == "true" ? "1" : "0";
@@ -58,59 +54,65 @@ bool take_up_or_down(const std::string &text, std::string *out) {
 }
 
 constexpr metric_row rows[] = {
-    {NODE_PLANE_STATE "/own", "", metric_kind::counter, "wccp_own_packets",
-     "Redirected packets of the appliance itself, given back.", take_count},
-    {NODE_PLANE_STATE "/clamped", "", metric_kind::counter, "wccp_clamped_syn_acks",
-     "SYN-ACKs whose segment size was lowered to fit the tunnel.", take_count},
-    {NODE_PLANE_STATE "/refused/*", "reason", metric_kind::counter, "wccp_gre_refused_packets",
-     "GRE packets that belong to no tunnel, by the reason of their refusal.", take_count},
-    {NODE_PLANE_STATE "/refused_source/*", "source", metric_kind::counter, "wccp_gre_refused_source_packets",
-     "GRE packets from addresses that are no routers of ours.", take_count},
-    {NODE_TUNNEL_STATE "/*/packets_in", "tunnel", metric_kind::counter, "wccp_tunnel_received_packets",
-     "Packets that routers have redirected through the tunnel.", take_count},
-    {NODE_TUNNEL_STATE "/*/bytes_in", "tunnel", metric_kind::counter, "wccp_tunnel_received_bytes",
-     "Bytes that routers have redirected through the tunnel.", take_count},
-    {NODE_TUNNEL_STATE "/*/packets_out", "tunnel", metric_kind::counter, "wccp_tunnel_returned_packets",
-     "Packets given back through the tunnel.", take_count},
-    {NODE_TUNNEL_STATE "/*/bytes_out", "tunnel", metric_kind::counter, "wccp_tunnel_returned_bytes",
-     "Bytes given back through the tunnel.", take_count},
-    {NODE_TUNNEL_STATE "/*/fragments", "tunnel", metric_kind::counter, "wccp_tunnel_fragments",
-     "Fragments of GRE packets that came in.", take_count},
-    {NODE_TUNNEL_STATE "/*/refused/*", "tunnel reason", metric_kind::counter, "wccp_tunnel_refused_packets",
-     "GRE packets of the tunnel's router that were refused, by reason.", take_count},
-    {NODE_INTERCEPT_STATE "/*/proxy", "group", metric_kind::gauge, "wccp_proxy_up",
-     "Whether the proxy of the group's intercept answers its health check.", take_up_or_down},
-    {NODE_INTERCEPT_STATE "/*/proxy_ms", "group", metric_kind::gauge, "wccp_proxy_state_seconds",
-     "How long the proxy has been in its state.", take_milliseconds},
-    {NODE_INTERCEPT_STATE "/*/active", "group", metric_kind::gauge, "wccp_intercept_active",
-     "Whether the group's role lets new flows go to the proxy.", take_flag},
-    {NODE_INTERCEPT_STATE "/*/left", "group", metric_kind::gauge, "wccp_intercept_left",
-     "Whether the group is out of its routers because of its proxy.", take_flag},
-    {NODE_INTERCEPT_STATE "/*/flows", "group", metric_kind::gauge, "wccp_intercept_flows",
-     "Connections that the proxy serves for the group.", take_count},
+    {NODE_PROCESSES "/*/restarts", metric_place("wccp_process_restarts"), take_count},
+    {NODE_PLANE_STATE "/own", metric_place("wccp_own_packets"), take_count},
+    {NODE_PLANE_STATE "/clamped", metric_place("wccp_clamped_syn_acks"), take_count},
+    {NODE_PLANE_STATE "/refused/*", metric_place("wccp_gre_refused_packets"), take_count},
+    {NODE_PLANE_STATE "/refused_source/*", metric_place("wccp_gre_refused_source_packets"), take_count},
+    {NODE_TUNNEL_STATE "/*/packets_in", metric_place("wccp_tunnel_received_packets"), take_count},
+    {NODE_TUNNEL_STATE "/*/bytes_in", metric_place("wccp_tunnel_received_bytes"), take_count},
+    {NODE_TUNNEL_STATE "/*/packets_out", metric_place("wccp_tunnel_returned_packets"), take_count},
+    {NODE_TUNNEL_STATE "/*/bytes_out", metric_place("wccp_tunnel_returned_bytes"), take_count},
+    {NODE_TUNNEL_STATE "/*/fragments", metric_place("wccp_tunnel_fragments"), take_count},
+    {NODE_TUNNEL_STATE "/*/refused/*", metric_place("wccp_tunnel_refused_packets"), take_count},
+    {NODE_INTERCEPT_STATE "/*/proxy", metric_place("wccp_proxy_up"), take_up_or_down},
+    {NODE_INTERCEPT_STATE "/*/proxy_ms", metric_place("wccp_proxy_state_seconds"), take_fraction<3>},
+    {NODE_INTERCEPT_STATE "/*/active", metric_place("wccp_intercept_active"), take_flag},
+    {NODE_INTERCEPT_STATE "/*/left", metric_place("wccp_intercept_left"), take_flag},
+    {NODE_INTERCEPT_STATE "/*/overloaded", metric_place("wccp_intercept_overloaded"), take_flag},
+    {NODE_INTERCEPT_STATE "/*/weight_percent", metric_place("wccp_intercept_weight_ratio"), take_fraction<2>},
+    {NODE_INTERCEPT_STATE "/*/flows", metric_place("wccp_intercept_flows"), take_count},
+    {NODE_PROTECTION_STATE "/group/*/covered", metric_place("wccp_protection_covered"), take_flag},
+};
+
+// Nodes "to_proxy" and, of some, "to_proxy_bytes", by what became of the packets.
+constexpr struct {
+    const char *node; // the last "*" is the label "way"
+    size_t packets, bytes;
+} way_rows[] = {
+    {NODE_TUNNEL_STATE "/*/*", metric_place("wccp_tunnel_sorted_packets"),
+     metric_place("wccp_tunnel_sorted_bytes")},
+    {NODE_INTERCEPT_STATE "/*/*", metric_place("wccp_intercept_packets"),
+     metric_place("wccp_intercept_bytes")},
+    {NODE_PROTECTION_STATE "/member/*/*", metric_place("wccp_protection_packets"), 0},
 };
 
 // --- Samples
 
 struct gathering {
-    const ctl_ask &ask;
-    std::vector<metric_sample> *out;
+    const metric_source &source;
+    metric_lines *out;
 
-    void add(metric_kind kind, const std::string &family, const std::string &help, const std::string &labels,
-             const std::string &value) const {
-        out->push_back({family, kind, help, labels, value});
+    void add(size_t family, std::string_view labels, std::string_view value) const {
+        const metric_family &about = metric_families[family];
+        std::string *lines = &(*out)[family];
+        lines->append(about.name);
+        if (about.kind != metric_kind::gauge)
+            lines->append(about.kind == metric_kind::counter ? "_total" : "_info");
+        if (!labels.empty())
+            lines->append("{").append(labels).append("}");
+        lines->append(" ").append(value).append("\n");
     }
-    // False: nobody has answered, neither the daemon nor mgmtd.
-    bool walk(ctl_walk how, const std::string &root, ctl_reply *reply) const {
+    // False: no answer, neither from a daemon nor from mgmtd.
+    bool ask(ctl_walk walk, const std::vector<std::string> &names, ctl_reply *reply) const {
         *reply = {};
-        node_name name;
-        return parse_node_name(root, &name) && query_walk(ask, how, name, reply);
+        return source(walk, names, reply);
     }
 };
 
-void add_label(std::string *inout, const std::string &name, const std::string &value) {
-    *inout += (inout->empty() ? "" : ",") + name + "=\"";
-    for (const char c : clean_text(value, LABEL_MAX)) {
+void add_label(std::string *inout, std::string_view name, std::string_view value) {
+    inout->append(inout->empty() ? "" : ",").append(name).append("=\"");
+    for (const char c : clean_text(std::string(value), LABEL_MAX)) {
         if (c == '"' || c == '\\')
             *inout += '\\';
         *inout += c;
@@ -118,63 +120,67 @@ void add_label(std::string *inout, const std::string &name, const std::string &v
     *inout += '"';
 }
 
-std::string label(const std::string &name, const std::string &value) {
+std::string label(std::string_view name, std::string_view value) {
     std::string out;
     add_label(&out, name, value);
     return out;
 }
 
+// The next word, which is taken off `inout`; empty at the end.
+std::string_view take_word(std::string_view *inout) {
+    inout->remove_prefix(std::min(inout->find_first_not_of(' '), inout->size()));
+    const std::string_view word = inout->substr(0, inout->find(' '));
+    inout->remove_prefix(word.size());
+    return word;
+}
+
 // The parts of `name` at the places of "*" as labels.
-std::string labels_of(const metric_row &row, const node_name &pattern, const node_name &name) {
-    std::istringstream words(row.labels);
-    std::string out, word;
+std::string labels_of(const metric_family &family, const node_name &pattern, const node_name &name) {
+    std::string_view words = family.labels;
+    std::string out;
     for (size_t i = 0; i < pattern.parts.size(); i++)
-        if (pattern.parts[i] == "*" && words >> word)
-            add_label(&out, word, name.parts[i]);
+        if (pattern.parts[i] == "*")
+            add_label(&out, take_word(&words), name.parts[i]);
     return out;
 }
 
-// "to_proxy" and "to_proxy_bytes" below `root`, by way.
-void add_sorted_sample(const gathering &work, const char *root, const char *about, const char *subject,
-                       const node_name &name, const std::string &value) {
-    if (name.parts.size() != parsed_name(root).parts.size() + 2 || !is_count(value))
-        return;
-    std::string way = name.parts.back();
-    const bool bytes = way.ends_with("_bytes");
-    if (bytes)
-        way.resize(way.size() - strlen("_bytes"));
-    for (const sorted_way &known : sorted_ways()) {
-        if (way != known.word)
-            continue;
-        std::string labels = label(about, name.parts[name.parts.size() - 2]);
-        add_label(&labels, "way", way);
-        work.add(metric_kind::counter, std::string("wccp_") + subject + (bytes ? "_bytes" : "_packets"),
-                 "What became of redirected packets; the way \"in\" is their sum.", labels, value);
-    }
+bool is_way(std::string_view word) {
+    static constexpr std::string_view of_members[] = {"passed", "received", "delivered", "returned"};
+    return std::ranges::count(of_members, word) != 0 ||
+           std::ranges::any_of(sorted_ways(), [&](const sorted_way &way) { return way.word == word; });
+}
+
+template <typename Row>
+std::vector<node_name> patterns_of(const Row &table) {
+    std::vector<node_name> out;
+    for (const auto &row : table)
+        out.push_back(parsed_name(row.node));
+    return out;
 }
 
 void add_node_samples(const gathering &work, const std::vector<ctl_binding> &bindings) {
-    static const std::vector<node_name> patterns = [] {
-        std::vector<node_name> out;
-        for (const metric_row &row : rows)
-            out.push_back(parsed_name(row.node));
-        return out;
-    }();
+    static const std::vector<node_name> patterns = patterns_of(rows), way_patterns = patterns_of(way_rows);
     for (const ctl_binding &binding : bindings) {
-        const node_name name = parsed_name(binding.name);
+        node_name name = parsed_name(binding.name);
         std::string value;
         for (size_t i = 0; i < std::size(rows); i++)
             if (matches(patterns[i], name) && rows[i].value(binding.value, &value))
-                work.add(rows[i].kind, rows[i].family, rows[i].help, labels_of(rows[i], patterns[i], name),
+                work.add(rows[i].family, labels_of(metric_families[rows[i].family], patterns[i], name),
                          value);
-        if (name.is_under(parsed_name(NODE_TUNNEL_STATE)))
-            add_sorted_sample(work, NODE_TUNNEL_STATE, "tunnel", "tunnel_sorted", name, binding.value);
-        else if (name.is_under(parsed_name(NODE_INTERCEPT_STATE)))
-            add_sorted_sample(work, NODE_INTERCEPT_STATE, "group", "intercept", name, binding.value);
+        for (size_t i = 0; i < std::size(way_rows); i++) {
+            if (!matches(way_patterns[i], name) || !is_count(binding.value))
+                continue;
+            std::string *way = &name.parts.back();
+            const bool bytes = way_rows[i].bytes != 0 && way->ends_with("_bytes");
+            if (bytes)
+                way->resize(way->size() - std::string_view("_bytes").size());
+            const size_t family = bytes ? way_rows[i].bytes : way_rows[i].packets;
+            if (is_way(*way))
+                work.add(family, labels_of(metric_families[family], way_patterns[i], name), binding.value);
+        }
     }
 }
 
-// What belongs to a tunnel's number: it means something on this appliance only.
 void add_tunnel_names(const gathering &work, const std::vector<ctl_binding> &bindings) {
     std::map<std::string, std::map<std::string, std::string>> tunnels;
     for (const ctl_binding &binding : bindings)
@@ -185,204 +191,186 @@ void add_tunnel_names(const gathering &work, const std::vector<ctl_binding> &bin
         std::string labels = label("tunnel", id);
         add_label(&labels, "router", nodes["remote"]);
         add_label(&labels, "interface", nodes["interface"]);
-        work.add(metric_kind::info, "wccp_tunnel", "The ends of a tunnel.", labels, "1");
+        work.add(metric_place("wccp_tunnel"), labels, "1");
     }
 }
 
 bool gather_tunneld(const gathering &work) {
-    std::vector<ctl_binding> all;
-    bool running = false;
-    for (const char *root : {NODE_PLANE_STATE, NODE_TUNNEL_STATE, NODE_INTERCEPT_STATE}) {
-        ctl_reply reply;
-        if (!work.walk(ctl_walk::subtree, root, &reply))
-            return false;
-        running |= reply.code == 0 && root == std::string(NODE_PLANE_STATE) && !reply.bindings.empty();
-        if (!running)
-            break;
-        all.insert(all.end(), reply.bindings.begin(), reply.bindings.end());
-    }
-    work.add(metric_kind::gauge, "wccp_daemon_up", "Whether the daemon answers.", label("daemon", "tunneld"),
-             running ? "1" : "0");
-    for (const ctl_binding &binding : all)
-        if (binding.name == NODE_PLANE_STATE "/name")
-            work.add(metric_kind::info, "wccp_data_plane", "How redirected packets are carried.",
-                     label("plane", binding.value), "1");
-    add_node_samples(work, all);
-    add_tunnel_names(work, all);
+    ctl_reply reply;
+    if (!work.ask(ctl_walk::subtree,
+                  {NODE_PLANE_STATE, NODE_TUNNEL_STATE, NODE_INTERCEPT_STATE, NODE_PROTECTION_STATE}, &reply))
+        return false;
+    const auto plane = std::ranges::find(reply.bindings, NODE_PLANE_STATE "/name", &ctl_binding::name);
+    const bool running = plane != reply.bindings.end();
+    work.add(metric_place("wccp_daemon_up"), label("daemon", "tunneld"), running ? "1" : "0");
+    if (running)
+        work.add(metric_place("wccp_data_plane"), label("plane", plane->value), "1");
+    add_node_samples(work, reply.bindings);
+    add_tunnel_names(work, reply.bindings);
     return true;
 }
 
 // --- wccpd
 
-// One line of a group's text: the word it begins with, and what becomes of the words after it. "-" is no
-// sample, "=NAME" a label, anything else a gauge of that name.
+// A line of a text: the word that it begins with, its labels, and the samples that the words after them are.
 struct line_row {
-    const char *word;
-    std::vector<const char *> columns;
+    std::string_view word;
+    size_t labels; // as many words, named as the families' labels after "group"
+    std::vector<size_t> families;
 };
-const std::map<std::string, const char *> &group_gauges() {
-    static const std::map<std::string, const char *> help = {
-        {"wccp_group_active", "Whether the group's role is ACTIVE."},
-        {"wccp_group_designated", "Whether this is the designated appliance of the group."},
-        {"wccp_group_uptime_seconds", "How long the group has been ACTIVE or BACKUP."},
-        {"wccp_group_routers", "Routers that have answered."},
-        {"wccp_group_appliances", "Appliances in the view of the routers."},
-        {"wccp_group_pending_acks", "Routers that have not acknowledged the table sent last."},
-        {"wccp_router_two_way", "Whether the router reports this appliance."},
-        {"wccp_router_heard_seconds", "Time since the last I-See-You of the router."},
-        {"wccp_router_connected_seconds", "How long the router has been in its state."},
-        {"wccp_router_own_buckets", "Buckets or mask values that the router gives this appliance."},
-        {"wccp_router_buckets", "Buckets or mask values that the router gives anybody."},
-        {"wccp_appliance_weight", "The weight of an appliance as the routers report it."},
-        {"wccp_reason_occurrences", "What keeps the group from working, by its code, and how often."},
-        {"wccp_reason_last_seconds", "Time since the reason's last occurrence."},
-    };
-    return help;
-}
-const std::vector<line_row> &group_lines() {
+const std::vector<line_row> &text_lines() {
     static const std::vector<line_row> lines = {
-        {"group",
-         {"wccp_group_active", "wccp_group_designated", "wccp_group_uptime_seconds", "wccp_group_routers",
-          "wccp_group_appliances", "wccp_group_pending_acks"}},
         {"router",
-         {"=router", "=address", "wccp_router_two_way", "wccp_router_heard_seconds",
-          "wccp_router_connected_seconds", "wccp_router_own_buckets", "wccp_router_buckets"}},
-        {"appliance", {"=appliance", "wccp_appliance_weight"}},
-        {"reason", {"=reason", "=sender", "wccp_reason_occurrences", "wccp_reason_last_seconds"}},
+         2,
+         {metric_place("wccp_router_two_way"), metric_place("wccp_router_heard_seconds"),
+          metric_place("wccp_router_connected_seconds"), metric_place("wccp_router_own_buckets"),
+          metric_place("wccp_router_buckets")}},
+        {"appliance", 1, {metric_place("wccp_appliance_weight")}},
+        {"reason", 2, {metric_place("wccp_reason_occurrences"), metric_place("wccp_reason_last_seconds")}},
+        {"interface",
+         1,
+         {metric_place("wccp_interface_ready"), metric_place("wccp_interface_starts"),
+          metric_place("wccp_interface_stops"), metric_place("wccp_interface_link_downs"),
+          metric_place("wccp_interface_address_changes")}},
     };
     return lines;
 }
 
-void add_counter_line(const gathering &work, const std::string &group, std::istream &words) {
-    std::string name, value;
-    if (words >> name >> value && is_count(value) &&
-        std::all_of(name.begin(), name.end(), [](char c) { return c == '_' || (c >= 'a' && c <= 'z'); }))
-        work.add(metric_kind::counter, "wccp_group_" + name,
-                 "The counter " + name + " of the group, as its dump has it.", label("group", group), value);
+// A line "gauge WORD VALUE" or "counter WORD VALUE".
+void add_named_number(const gathering &work, const std::string &labels, std::string_view word,
+                      std::string_view value) {
+    static const std::map<std::string_view, size_t> places = [] {
+        std::map<std::string_view, size_t> out;
+        for (size_t i = 0; i < std::size(metric_families); i++)
+            out[metric_families[i].name] = i;
+        return out;
+    }();
+    const std::string name = std::string(labels.empty() ? "wccp_" : "wccp_group_").append(word);
+    if (const auto found = places.find(name); found != places.end() && is_count(value))
+        work.add(found->second, labels, value);
 }
 
-void add_group_line(const gathering &work, const std::string &group, const std::string &line) {
-    std::istringstream words(line);
-    std::string word;
-    if (!(words >> word))
-        return;
-    if (word == "counter")
-        return add_counter_line(work, group, words);
-    for (const line_row &row : group_lines()) {
-        if (word != row.word)
+void add_text_line(const gathering &work, const std::string &group_labels, std::string_view line) {
+    std::string_view words[WORDS_MAX];
+    size_t count = 0;
+    for (std::string_view word = take_word(&line); !word.empty(); word = take_word(&line)) {
+        if (count == WORDS_MAX)
+            return;
+        words[count++] = word;
+    }
+    if (count == 3 && (words[0] == "gauge" || words[0] == "counter"))
+        return add_named_number(work, group_labels, words[1], words[2]);
+    for (const line_row &row : text_lines()) {
+        if (count != 1 + row.labels + row.families.size() || words[0] != row.word)
             continue;
-        std::string labels = group.empty() ? "" : label("group", group), value;
-        for (const char *column : row.columns) {
-            if (!(words >> value))
-                return;
-            if (column[0] == '=')
-                add_label(&labels, column + 1, value);
-            else if (is_count(value))
-                work.add(metric_kind::gauge, column, group_gauges().at(column), labels, value);
-        }
+        std::string labels = group_labels;
+        std::string_view names = metric_families[row.families[0]].labels;
+        if (names.starts_with("group "))
+            (void)take_word(&names);
+        for (size_t i = 0; i < row.labels; i++)
+            add_label(&labels, take_word(&names), words[1 + i]);
+        for (size_t i = 0; i < row.families.size(); i++)
+            if (const std::string_view value = words[1 + row.labels + i]; is_count(value))
+                work.add(row.families[i], labels, value);
     }
 }
 
-bool gather_group(const gathering &work, const std::string &group) {
+void add_text(const gathering &work, const std::string &group_labels, std::string_view text) {
+    for (size_t count = 0; count < LINES_MAX && !text.empty(); count++) {
+        const std::string_view line = text.substr(0, text.find('\n'));
+        add_text_line(work, group_labels, line);
+        text.remove_prefix(std::min(line.size() + 1, text.size()));
+    }
+}
+
+bool gather_groups(const gathering &work) {
     ctl_reply reply;
-    if (!work.ask(ctl_walk::node, std::string(NODE_GROUP_STATE "/") + group + "/metric/all", &reply))
+    if (!work.ask(ctl_walk::children, {NODE_GROUP_STATE}, &reply))
         return false;
-    if (reply.code != 0 || reply.bindings.empty())
-        return true; // gone in the meantime
-    std::istringstream lines(reply.bindings[0].value);
-    std::string line;
-    for (size_t count = 0; count < LINES_MAX && std::getline(lines, line); count++)
-        add_group_line(work, group, line);
+    std::vector<std::string> names;
+    for (const ctl_binding &binding : reply.bindings)
+        if (parts_below(NODE_GROUP_STATE, binding.name).size() == 1 && names.size() < GROUPS_MAX)
+            names.push_back(binding.name + "/metric/all");
+    for (size_t first = 0; first < names.size(); first += GROUPS_AT_ONCE) {
+        const auto from = names.begin() + static_cast<std::ptrdiff_t>(first);
+        const size_t some = std::min(GROUPS_AT_ONCE, names.size() - first);
+        if (!work.ask(ctl_walk::node, {from, from + static_cast<std::ptrdiff_t>(some)}, &reply))
+            return false;
+        for (const ctl_binding &binding : reply.bindings)
+            if (const std::vector<std::string> parts = parts_below(NODE_GROUP_STATE, binding.name);
+                parts.size() == 3)
+                add_text(work, label("group", parts[0]), binding.value);
+    }
     return true;
 }
 
 bool gather_wccpd(const gathering &work) {
     ctl_reply reply;
-    if (!work.ask(ctl_walk::node, NODE_WCCPD_VERSION, &reply))
+    if (!work.ask(ctl_walk::node, {NODE_WCCPD_VERSION, NODE_WCCPD_STATE "/metric/all"}, &reply))
         return false;
     const bool running = reply.code == 0 && !reply.bindings.empty();
-    work.add(metric_kind::gauge, "wccp_daemon_up", "Whether the daemon answers.", label("daemon", "wccpd"),
-             running ? "1" : "0");
-    if (!running)
-        return true;
-    work.add(metric_kind::info, "wccp_build", "The version of wccpd.",
-             label("version", reply.bindings[0].value), "1");
-    if (!work.walk(ctl_walk::children, NODE_GROUP_STATE, &reply))
-        return false;
-    size_t groups = 0;
+    work.add(metric_place("wccp_daemon_up"), label("daemon", "wccpd"), running ? "1" : "0");
     for (const ctl_binding &binding : reply.bindings)
-        if (const std::vector<std::string> parts = parts_below(NODE_GROUP_STATE, binding.name);
-            parts.size() == 1 && groups++ < GROUPS_MAX && !gather_group(work, parts[0]))
-            return false;
-    return true;
+        if (binding.name == NODE_WCCPD_VERSION)
+            work.add(metric_place("wccp_build"), label("version", binding.value), "1");
+        else
+            add_text(work, "", binding.value);
+    return !running || gather_groups(work);
 }
 
 // --- mgmtd
 
 bool gather_mgmtd(const gathering &work) {
     ctl_reply reply;
-    if (!work.walk(ctl_walk::subtree, NODE_ALARMS_RAISED, &reply))
+    if (!work.ask(ctl_walk::subtree, {NODE_ALARMS_RAISED, NODE_PROCESSES}, &reply))
         return false;
+    work.add(metric_place("wccp_daemon_up"), label("daemon", "mgmtd"), "1");
+    add_node_samples(work, reply.bindings);
+    std::erase_if(reply.bindings, [](const ctl_binding &binding) {
+        return parts_below(NODE_ALARMS_RAISED, binding.name).empty();
+    });
     const std::vector<ctl_alarm> active = alarms_of(reply.bindings);
-    work.add(metric_kind::gauge, "wccp_alarms", "Alarms that are active.", "", std::to_string(active.size()));
+    work.add(metric_place("wccp_alarms"), "", std::to_string(active.size()));
     for (const ctl_alarm &alarm : active) {
         std::string labels = label("alarm", alarm.name);
         add_label(&labels, "source", alarm.source);
-        work.add(metric_kind::gauge, "wccp_alarm_active", "An alarm that is active.", labels, "1");
+        work.add(metric_place("wccp_alarm_active"), labels, "1");
     }
-    if (!work.walk(ctl_walk::subtree, NODE_PROCESSES, &reply))
-        return false;
-    for (const ctl_binding &binding : reply.bindings)
-        if (const std::vector<std::string> parts = parts_below(NODE_PROCESSES, binding.name);
-            parts.size() == 2 && parts[1] == "restarts" && is_count(binding.value))
-            work.add(metric_kind::counter, "wccp_process_restarts",
-                     "How often mgmtd has started the program again.", label("process", parts[0]),
-                     binding.value);
     return true;
 }
 
 } // namespace
 
-bool gather_metrics(const ctl_ask &ask, std::vector<metric_sample> *out) {
-    const gathering work{ask, out};
-    const auto say_up = [&](const char *value) {
-        work.add(metric_kind::gauge, "wccp_daemon_up", "Whether the daemon answers.",
-                 label("daemon", "mgmtd"), value);
-    };
-    if (gather_mgmtd(work) && gather_wccpd(work) && gather_tunneld(work)) {
-        say_up("1");
+bool gather_metrics(const metric_source &source, metric_lines *out) {
+    const gathering work{source, out};
+    if (gather_mgmtd(work) && gather_wccpd(work) && gather_tunneld(work))
         return true;
-    }
-    out->clear();
-    say_up("0");
+    *out = {};
+    work.add(metric_place("wccp_daemon_up"), label("daemon", "mgmtd"), "0");
     return false;
 }
 
-std::string metrics_text(const std::vector<metric_sample> &samples, metric_format format) {
-    const auto suffix = [](metric_kind kind) {
-        return kind == metric_kind::counter ? "_total" : kind == metric_kind::info ? "_info" : "";
-    };
-    std::vector<const metric_sample *> families; // the first of each
-    std::map<std::string, std::string> lines;    // of its samples
-    for (const metric_sample &sample : samples) {
-        const auto [at, is_new] = lines.try_emplace(sample.family);
-        if (is_new)
-            families.push_back(&sample);
-        at->second += sample.family + suffix(sample.kind) +
-                      (sample.labels.empty() ? "" : "{" + sample.labels + "}") + " " + sample.value + "\n";
-    }
+std::string metrics_text(const metric_lines &samples, metric_format format) {
     const bool modern = format == metric_format::openmetrics;
     std::string out;
-    for (const metric_sample *first : families) {
-        // "info" is a type that readers of the older format refuse.
-        const bool bare = modern && first->kind == metric_kind::counter;
-        const std::string name = first->family + (bare ? "" : suffix(first->kind));
-        const char *kind = first->kind == metric_kind::counter ? "counter" : "gauge";
-        out += "# TYPE " + name + " " + kind + "\n";
+    for (size_t i = 0; i < samples.size(); i++) {
+        if (samples[i].empty())
+            continue;
+        const metric_family &family = metric_families[i];
+        // Readers of the older format know a metric by its whole name, and refuse the type "info".
+        std::string name(family.name);
+        if (!modern && family.kind == metric_kind::counter)
+            name += "_total";
+        if (!modern && family.kind == metric_kind::info)
+            name += "_info";
+        out.append("# TYPE ").append(name);
+        out += family.kind == metric_kind::counter          ? " counter\n"
+               : modern && family.kind == metric_kind::info ? " info\n"
+                                                            : " gauge\n";
         for (const char *unit : {"seconds", "bytes"})
-            if (modern && first->family.ends_with(std::string("_") + unit))
-                out += "# UNIT " + name + " " + unit + "\n";
-        out += "# HELP " + name + " " + first->help + "\n" + lines.at(first->family);
+            if (modern && family.name.ends_with(std::string("_") + unit))
+                out.append("# UNIT ").append(name).append(" ").append(unit).append("\n");
+        out.append("# HELP ").append(name).append(" ").append(family.help).append("\n").append(samples[i]);
     }
     return out + (modern ? "# EOF\n" : "");
 }

@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include "peers/mgmtctl/commands.h"
-#include "peers/mgmtctl/link.h"
 #include "peers/mgmtctl/metrics.h"
 #include "peers/mgmtctl/render.h"
 #include "runtime/ttime.h"
@@ -40,10 +39,10 @@ static int answer_request(const char *status, const char *type, const std::strin
     return code;
 }
 
-static ctl_ask asking(const ctl_link &link) {
-    return [link](ctl_walk walk, const std::string &name, ctl_reply *out) {
+static metric_source asking(const ctl_link &link) {
+    return [link](ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out) {
         std::string reason;
-        return link.query(walk, name, out, &reason);
+        return link.query_all(walk, names, out, &reason);
     };
 }
 
@@ -64,7 +63,7 @@ int serve_metrics_request(const ctl_link &link) {
                                      ? metric_format::openmetrics
                                      : metric_format::text;
     // A mgmtd that does not answer is what the samples say then.
-    std::vector<metric_sample> samples;
+    metric_lines samples;
     (void)gather_metrics(asking(link), &samples);
     return answer_request("200 OK", metrics_content_type(format), metrics_text(samples, format), !head,
                           CTL_OK);
@@ -74,7 +73,7 @@ int ctl_metrics(const ctl_options &options, bool text, bool http) {
     const ctl_link link = link_to_mgmtd(options);
     if (http)
         return serve_metrics_request(link);
-    std::vector<metric_sample> samples;
+    metric_lines samples;
     const bool answered = gather_metrics(asking(link), &samples);
     put(metrics_text(samples, text ? metric_format::text : metric_format::openmetrics));
     return answered ? CTL_OK : CTL_UNREACHABLE;

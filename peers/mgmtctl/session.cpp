@@ -278,6 +278,11 @@ static bool no_memory(std::string *out_reason) {
 
 bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out,
                std::string *out_reason) {
+    return ctl_query_all(session, walk, {name}, out, out_reason);
+}
+
+bool ctl_query_all(ctl_session *session, ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out,
+                   std::string *out_reason) {
     uint32_t flags = 0;
     if (walk == ctl_walk::subtree || walk == ctl_walk::leaves)
         flags |= bn_qf_subtree | bn_qf_include_self;
@@ -285,9 +290,11 @@ bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl
         flags |= bn_qf_leaves_only;
     const uint32_t subop = walk == ctl_walk::node ? bn_query_get : bn_query_iterate;
     owned_request msg;
-    if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK ||
-        bn_query_request_msg_append_str(msg.pointer, subop, flags, name.c_str(), nullptr) != LC_OK)
+    if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK)
         return no_memory(out_reason);
+    for (const std::string &name : names)
+        if (bn_query_request_msg_append_str(msg.pointer, subop, flags, name.c_str(), nullptr) != LC_OK)
+            return no_memory(out_reason);
     return send_request(session, msg.pointer, out, out_reason);
 }
 

@@ -48,6 +48,9 @@ void ctl_close(ctl_session *session);
 // False, with the reason, when no answer came: the session is of no use then.
 bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out,
                std::string *out_reason);
+// Several names in one request. What does not exist is left out of the answer.
+bool ctl_query_all(ctl_session *session, ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out,
+                   std::string *out_reason);
 // How a commit is made.
 struct ctl_order {
     std::string cause;            // what it is for, in the history

@@ -161,6 +161,7 @@ const std::vector<const char *> &wccpd_state_nodes() {
         NODE_WCCPD_STATE "/debug_global",
         NODE_WCCPD_STATE "/debug_all",
         REASONS(NODE_WCCPD_STATE),
+        NODE_WCCPD_STATE "/metric/*",
         NODE_WCCPD_STATE "/interface/*",
         NODE_WCCPD_STATE "/interface/*/address",
         NODE_WCCPD_STATE "/interface/*/link",

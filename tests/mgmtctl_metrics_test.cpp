@@ -1,0 +1,129 @@
+// Metrics: what samples states become, in both formats, and the names that documents, alert rules, the
+// dashboard and the engine share with the table of metrics.
+#include <algorithm>
+#include <fstream>
+#include <iterator>
+#include <regex>
+#include <set>
+
+#include <gtest/gtest.h>
+
+#include "mgmt/node_paths.h"
+#include "peers/mgmtctl/metrics.h"
+
+static const std::string STATES = "/qv/wccpd/wccp/srv_grp/state";
+
+static metric_source answered_by(const std::vector<ctl_binding> &nodes) {
+    return [&nodes](ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out) {
+        for (const ctl_binding &node : nodes)
+            for (const std::string &name : names)
+                if (node.name == name ? walk != ctl_walk::children
+                                      : walk != ctl_walk::node && node.name.starts_with(name + "/"))
+                    out->bindings.push_back(node);
+        return true;
+    };
+}
+
+// Numbers from outside stay numbers, texts stay within their labels, and a daemon that is gone is said to be.
+TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
+    const std::vector<ctl_binding> known = {
+        {NODE_WCCPD_VERSION, "string", "1.0.0"},
+        {NODE_WCCPD_STATE "/metric/all", "string",
+         "counter rx_failures 9\ninterface eth0 1 2 3 4 5\ninterface a b 1 2 3 4 5\nreason group-unknown "
+         "10.0.0.7 1 2\n"},
+        {STATES + "/51", "string", "51"},
+        {STATES + "/51/metric/all", "string",
+         "gauge active 1\ngauge pending_acks x\ncounter rx_icus 5\ncounter Bad{} 5\n"
+         "router 10.0.0.1 10.0.0.9 1 3 40 128 256\nrouter 10.0.0.2\nnothing 1\n"
+         "reason password-mismatch 10.0.0.1 7 2"},
+        {NODE_PLANE_STATE "/name", "string", "user"},
+        {NODE_PLANE_STATE "/refused/source", "uint64", "4"},
+        {NODE_TUNNEL_STATE "/232", "uint16", "232"},
+        {NODE_TUNNEL_STATE "/232/remote", "ipv4addr", "10.0.0.1"},
+        {NODE_TUNNEL_STATE "/232/to_proxy_bytes", "uint64", "99"},
+        {NODE_INTERCEPT_STATE "/51", "uint8", "51"},
+        {NODE_INTERCEPT_STATE "/51/proxy", "string", "unknown"},
+        {NODE_INTERCEPT_STATE "/51/proxy_ms", "uint64", "1500"},
+        {NODE_INTERCEPT_STATE "/51/weight_percent", "uint32", "5"},
+        {NODE_PROTECTION_STATE "/member/10.0.0.102/passed", "uint64", "3"},
+        {NODE_ALARMS_RAISED "/196638/a\"b\\\\c", "string", "text"},
+        {NODE_PROCESSES "/wccpd", "string", "running"},
+        {NODE_PROCESSES "/wccpd/restarts", "uint32", "2"}};
+    metric_lines samples;
+    ASSERT_TRUE(gather_metrics(answered_by(known), &samples));
+    const std::string modern = "\n" + metrics_text(samples, metric_format::openmetrics);
+    for (const char *line :
+         {"wccp_build_info{version=\"1.0.0\"} 1", "# TYPE wccp_build info", "wccp_rx_failures_total 9",
+          "wccp_interface_link_downs_total{interface=\"eth0\"} 4",
+          "wccp_reason_occurrences{reason=\"group-unknown\",sender=\"10.0.0.7\"} 1",
+          "wccp_group_active{group=\"51\"} 1", "wccp_group_rx_icus_total{group=\"51\"} 5",
+          "# TYPE wccp_group_rx_icus counter", "# UNIT wccp_router_heard_seconds seconds",
+          "wccp_router_own_buckets{group=\"51\",router=\"10.0.0.1\",address=\"10.0.0.9\"} 128",
+          "wccp_reason_occurrences{group=\"51\",reason=\"password-mismatch\",sender=\"10.0.0.1\"} 7",
+          "wccp_gre_refused_packets_total{reason=\"source\"} 4",
+          "wccp_tunnel_info{tunnel=\"232\",router=\"10.0.0.1\",interface=\"\"} 1",
+          "wccp_tunnel_sorted_bytes_total{tunnel=\"232\",way=\"to_proxy\"} 99",
+          "wccp_proxy_state_seconds{group=\"51\"} 1.500", "wccp_intercept_weight_ratio{group=\"51\"} 0.05",
+          "wccp_protection_packets_total{appliance=\"10.0.0.102\",way=\"passed\"} 3",
+          "wccp_process_restarts_total{process=\"wccpd\"} 2", "wccp_daemon_up{daemon=\"tunneld\"} 1"})
+        EXPECT_NE(modern.find("\n" + std::string(line) + "\n"), std::string::npos)
+            << line << " in " << modern;
+    for (const char *none :
+         {"pending_acks{", "Bad", "nothing", "wccp_proxy_up{", "router=\"10.0.0.2\"", "interface=\"a\""})
+        EXPECT_EQ(modern.find(none), std::string::npos) << none;
+    EXPECT_NE(modern.find("source=\"a\\\"b"), std::string::npos) << modern;
+    EXPECT_TRUE(modern.ends_with("\n# EOF\n"));
+    EXPECT_NE(metrics_text(samples, metric_format::text).find("# TYPE wccp_group_rx_icus_total counter\n"),
+              std::string::npos);
+
+    const std::vector<ctl_binding> empty;
+    samples = {};
+    ASSERT_TRUE(gather_metrics(answered_by(empty), &samples));
+    EXPECT_NE(metrics_text(samples, metric_format::text).find("wccp_daemon_up{daemon=\"wccpd\"} 0\n"),
+              std::string::npos);
+    samples = {};
+    const auto silent = [](ctl_walk, const std::vector<std::string> &, ctl_reply *) { return false; };
+    EXPECT_FALSE(gather_metrics(silent, &samples));
+    EXPECT_EQ(metrics_text(samples, metric_format::text).find("wccp_daemon_up{daemon=\"mgmtd\"} 0\n"),
+              metrics_text(samples, metric_format::text).size() - 33);
+}
+
+static std::string text_of_file(const std::string &name) {
+    std::ifstream in(WCCP_SOURCE_DIR "/" + name);
+    return {std::istreambuf_iterator<char>(in), {}};
+}
+
+// The documents, the dashboard and the alert rules name metrics that exist, and each number of the engine has
+// one.
+TEST(Metrics, AreTheOnesThatOthersName) {
+    const std::string document = text_of_file("docs/metrics.md");
+    std::set<std::string> names;
+    for (const metric_family &family : metric_families) {
+        const char *const kinds[] = {"gauge", "counter", "info"}, *const suffixes[] = {"", "_total", "_info"};
+        const auto kind = static_cast<size_t>(family.kind);
+        const std::string name = std::string(family.name) + suffixes[kind];
+        names.insert(name);
+        const std::string row = "| `" + name + "` | " + kinds[kind] + " | " + std::string(family.labels) +
+                                (family.labels.empty() ? "| " : " | ") + std::string(family.help) + " |\n";
+        EXPECT_NE(document.find(row), std::string::npos) << row;
+    }
+    for (const char *file : {"docs/metrics.md", "packaging/prometheus/wccp.rules.yml",
+                             "packaging/prometheus/wccp.dashboard.json"}) {
+        const std::string text = text_of_file(file);
+        const std::regex name("\\bwccp_[a-z_]+\\b");
+        size_t found = 0;
+        for (std::sregex_iterator at(text.begin(), text.end(), name), end; at != end; ++at, found++)
+            EXPECT_TRUE(names.contains(at->str())) << at->str() << " in " << file;
+        EXPECT_GT(found, 8u) << file;
+    }
+    for (const char *file : {"engine/wccp_query.cpp", "engine/wccp_metrics.cpp"}) {
+        const std::string text = text_of_file(file);
+        const std::regex row("\n    \\{\"([a-z_]+)\",");
+        size_t found = 0;
+        for (std::sregex_iterator at(text.begin(), text.end(), row), end; at != end; ++at, found++)
+            EXPECT_TRUE(names.contains("wccp_group_" + at->str(1)) ||
+                        names.contains("wccp_group_" + at->str(1) + "_total"))
+                << at->str(1) << " of " << file;
+        EXPECT_GT(found, 8u) << file;
+    }
+}
