@@ -1,15 +1,18 @@
 // wccpd with a stopwatch on its engine lock: for each second of the clock one line on standard output, with
-// how often the lock was held, for how long at the mean and at most, and for how much processor time at most.
-// What a hold takes beyond its processor time it waited for: for the processor, or for somebody else.
+// how often the lock was held, for how long at the mean and at most, and for how much processor time at most;
+// then the same count and maxima for the main thread, which answers monitoring queries. What a hold takes
+// beyond its processor time is waiting, for a processor or another thread.
 //
 // The program's own pthread_mutex_lock and pthread_mutex_unlock stand in front of those of the C library. The
 // figures are guarded by the lock that they are about.
+#include <algorithm>
 #include <cstdint>
 #include <cstdio>
 #include <ctime>
 
 #include <dlfcn.h>
 #include <pthread.h>
+#include <unistd.h>
 
 #include "daemon/wccpd_main.h"
 #include "engine/wccp_records.h"
@@ -30,7 +33,7 @@ hold now() {
 }
 
 struct second {
-    int64_t number, holds, wall, wall_max, cpu_max;
+    int64_t number, holds, wall, wall_max, cpu_max, main_holds, main_wall_max, main_cpu_max;
 };
 hold taken;
 second current;
@@ -41,12 +44,17 @@ second count(const hold &given) {
     const int64_t wall = given.wall - taken.wall, cpu = given.cpu - taken.cpu;
     if (current.number != given.wall / 1'000'000'000) {
         over = current;
-        current = {given.wall / 1'000'000'000, 0, 0, 0, 0};
+        current = {given.wall / 1'000'000'000, 0, 0, 0, 0, 0, 0, 0};
     }
     current.holds++;
     current.wall += wall;
-    current.wall_max = wall > current.wall_max ? wall : current.wall_max;
-    current.cpu_max = cpu > current.cpu_max ? cpu : current.cpu_max;
+    current.wall_max = std::max(current.wall_max, wall);
+    current.cpu_max = std::max(current.cpu_max, cpu);
+    if (gettid() == getpid()) {
+        current.main_holds++;
+        current.main_wall_max = std::max(current.main_wall_max, wall);
+        current.main_cpu_max = std::max(current.main_cpu_max, cpu);
+    }
     return over;
 }
 
@@ -73,9 +81,12 @@ extern "C" int pthread_mutex_unlock(pthread_mutex_t *mutex) noexcept {
     const int result = real(mutex);
     if (over.holds) {
         const cancel_off_guard uncancelled;
-        dprintf(1, "%lld holds %lld mean %lld max %lld cpu %lld us\n", static_cast<long long>(over.number),
-                static_cast<long long>(over.holds), static_cast<long long>(over.wall / over.holds / 1000),
-                static_cast<long long>(over.wall_max / 1000), static_cast<long long>(over.cpu_max / 1000));
+        dprintf(1, "%lld holds %lld mean %lld max %lld cpu %lld us main %lld max %lld cpu %lld us\n",
+                static_cast<long long>(over.number), static_cast<long long>(over.holds),
+                static_cast<long long>(over.wall / over.holds / 1000),
+                static_cast<long long>(over.wall_max / 1000), static_cast<long long>(over.cpu_max / 1000),
+                static_cast<long long>(over.main_holds), static_cast<long long>(over.main_wall_max / 1000),
+                static_cast<long long>(over.main_cpu_max / 1000));
     }
     return result;
 }
