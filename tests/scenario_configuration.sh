@@ -258,6 +258,7 @@ case_full() {
 }
 
 # One change for three sites: fleet-apply stops at the second, which refuses it, and at a site that is unhealthy after it.
+# In batches, the first site is alone, and fleet-apply stops after the batch of the site that refuses.
 case_fleet() {
     local site file=$LAB/change.conf
     for site in 1 2 3; do
@@ -273,15 +274,17 @@ case_fleet() {
         [ $? = "$status" ] && [ "$got" = "$said" ] || die "fleet-apply $*: $got"
     }
     lab_group 51 10.0.0.1 10.0.0.102 weight=7 >"$file"
-    fleet 1 $'a1: changed\na2: refuses the change; halted, not yet reached: a3' --merge "$file" a1 a2 a3
+    fleet 1 $'a1: changed\na2: refuses the change\nhalted; not yet reached: a3' --merge "$file" a1 a2 a3
     [ "$(lab_manage a1 history | jq -c '.[0] | [.cause, .confirm_by]')" = '["apply",null]' ] || die "a1 is not confirmed"
     [ "$(lab_manage a3 history | jq length)" = 1 ] || die "a3 is changed"
     lab_group 51 10.0.0.1 weight=7 >"$file"
-    FLEET_HEALTH=false fleet 1 $'a2: is not well, and undoes the change in 5 minutes; halted, not yet reached: a3' --merge "$file" a2 a3
+    FLEET_HEALTH=false fleet 1 $'a2: is not well, and undoes the change in 5 minutes\nhalted; not yet reached: a3' --batch 2 --merge "$file" a2 a3
     lab_in a2 "$WCCP_BIN/mgmtctl" confirm >/dev/null || die "a2 does not wait"
     fleet 1 "a2: nothing to change"$'\n'"a3: modify /qv/wccpd/wccp/srv_grp/config/51/weight = 7 (was 100)" --check --merge "$file" a2 a3
     fleet 0 $'a2: unchanged\na3: changed' --merge "$file" a2 a3
-    fleet 0 $'a2: nothing to change\na3: nothing to change' --check --merge "$file" a2 a3
+    fleet 0 $'a2: nothing to change\na3: nothing to change' --check --batch 2 --merge "$file" a2 a3
+    lab_group 51 10.0.0.1 10.0.0.102 weight=8 >"$file"
+    fleet 1 $'a1: changed\na2: refuses the change\na3: changed\nhalted; not yet reached: a1' --batch 2 --merge "$file" a1 a2 a3 a1
 }
 
 lab_case
