@@ -213,7 +213,7 @@ struct Loop : testing::Test {
 
 // --- The session
 
-// mgmtd on the loop, and a wccpd that answers for one router of group 51.
+// mgmtd on the loop, and a wccpd that answers for one router of each of the groups 31 to 51.
 struct Session : Loop {
     static constexpr uint32_t WCCPD = 0x10000;
     std::unique_ptr<server> daemon;
@@ -286,7 +286,7 @@ struct Session : Loop {
         asked.clear();
     }
     void answer_for_wccpd() {
-        const std::string group = NODE_GROUP_STATE "/51", router = group + "/router/1";
+        const std::string group = NODE_GROUP_STATE "/51";
         while (!asked.empty()) {
             const owned_request msg(asked.front());
             asked.erase(asked.begin());
@@ -298,19 +298,23 @@ struct Session : Loop {
                 owned_binding binding(make_binding(name, {bn_type_str, text}));
                 (void)bn_query_response_msg_append_binding_takeover(response.pointer, &binding.pointer, id);
             };
+            int walks = 0;
             for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(msg.pointer->nodes); i++) {
                 const bn_request_node *node = bn_request_per_node_array_get_quick(msg.pointer->nodes, i);
-                if (name_of(node->binding) == NODE_GROUP_STATE)
-                    add(node->node_id, group, "51");
-                if (name_of(node->binding) == group + "/owners")
+                const std::string name = name_of(node->binding);
+                for (int id = 31; id <= 51 && name == NODE_GROUP_STATE; id++)
+                    add(node->node_id, name + "/" + std::to_string(id), std::to_string(id));
+                if (name == group + "/owners")
                     add(node->node_id, group + "/owners", "hash members 192.0.2.3");
-                if (name_of(node->binding) == group + "/router") {
-                    add(node->node_id, router + "/id", "192.0.2.1");
-                    add(node->node_id, router + "/ipaddr", "192.0.2.2");
-                    add(node->node_id, router + "/fwd_method", method == "L2" ? "GRE" : method);
-                    add(node->node_id, router + "/ret_method", method);
+                if (name.ends_with("/router") && node->subop == bn_query_iterate) {
+                    add(node->node_id, name + "/1/id", "192.0.2.1");
+                    add(node->node_id, name + "/1/ipaddr", "192.0.2.2");
+                    add(node->node_id, name + "/1/fwd_method", method == "L2" ? "GRE" : method);
+                    add(node->node_id, name + "/1/ret_method", method);
+                    walks++;
                 }
             }
+            EXPECT_LE(walks, 8) << "wccpd is kept busy for long";
             response.pointer->service_id = 2;
             ASSERT_EQ(bn_response_msg_serialize(response.pointer, 32, &frame.pointer), LC_OK);
             EXPECT_TRUE(server_take_frame(daemon.get(), WCCPD, bn_msg_query_response, frame.pointer));
@@ -331,10 +335,12 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     EXPECT_TRUE(view.groups.empty());
     set(NODE_GROUP_CONFIG "/51/interface", "lo");
     set(NODE_GROUP_CONFIG "/51/router/1/ipaddr", "192.0.2.2");
+    set(NODE_GROUP_CONFIG "/31/interface", "lo");
     set(NODE_INTERCEPT_CONFIG "/51/ports", "80");
     set(NODE_INTERCEPT_CONFIG "/51/to", "3128");
     ASSERT_TRUE(wait_until([&] {
-        return view.intercepts.size() == 1 && view.groups[51].routers.size() == 1;
+        return view.intercepts.size() == 1 && view.groups[51].routers.size() == 1 &&
+               view.groups[31].routers.size() == 1;
     })) << said;
     EXPECT_EQ(view.intercepts[51].to, 3128);
     EXPECT_EQ(view.groups[51].local, INADDR_LOOPBACK);

@@ -46,6 +46,9 @@ constexpr int64_t OWNERS_MS = 2000;       // between questions about the owners 
 constexpr int64_t ROUTER_KEPT_MS = 60000; // after wccpd listed it last
 constexpr int64_t NEVER = INT64_MAX;
 constexpr size_t REASON_MAX = 256;
+// Groups whose routers are asked for in one request. wccpd answers nobody else meanwhile; with 32 routers
+// each, it needs some 20 ms for these.
+constexpr size_t GROUPS_AT_ONCE = 8;
 
 struct known_router {
     group_router router;
@@ -73,6 +76,8 @@ struct mgmt_link {
     int64_t read_at_ms = NEVER, ask_routers_at_ms = NEVER, ask_wait_ms = ROUTERS_FIRST_MS;
     int64_t ask_owners_at_ms = NEVER;
     bool routers_are_due = false;                               // once the groups are known
+    std::vector<node_name> unasked;                             // groups that further requests ask about
+    std::vector<event_field> gathered;                          // what earlier ones have answered
     std::vector<event_field> configured, listed, states, owned; // answers, as they came
     bool has_configured = false, has_listed = false, has_states = false, has_owned = false;
 
@@ -418,21 +423,35 @@ bool wants_owners(const mgmt_link *link) {
     return link->announced && link->view.protection_s != 0 && !link->view.intercepts.empty();
 }
 
+// Asks about the routers of the next groups.
+void ask_about_routers(mgmt_link *link) {
+    std::vector<std::string> walks, single_nodes;
+    const size_t count = std::min(link->unasked.size(), GROUPS_AT_ONCE);
+    for (size_t i = 0; i < count; i++) {
+        walks.push_back(link->unasked[i].below("router").text());
+        for (const char *leaf : {"oper", "num_appliances"})
+            single_nodes.push_back(link->unasked[i].below(leaf).text());
+    }
+    link->unasked.erase(link->unasked.begin(), link->unasked.begin() + static_cast<ptrdiff_t>(count));
+    (void)send_queries(link, bn_query_iterate, walks, bn_qf_subtree, &link->routers, single_nodes);
+}
+
 // The groups that wccpd runs are asked for by name: a question about another would be an error in its log.
 void ask_about_groups(mgmt_link *link) {
     static const node_name root = parsed_name(NODE_GROUP_STATE);
-    std::vector<std::string> walks, single_nodes, owners;
+    std::vector<std::string> owners;
+    link->unasked.clear();
     for (const event_field &node : link->listed)
-        if (const node_name name = parsed_name(node.name);
+        if (node_name name = parsed_name(node.name);
             name.is_under(root) && name.parts.size() == root.parts.size() + 1) {
-            walks.push_back(name.below("router").text());
             owners.push_back(name.below("owners").text());
-            for (const char *leaf : {"oper", "num_appliances"})
-                single_nodes.push_back(name.below(leaf).text());
+            if (link->routers_are_due)
+                link->unasked.push_back(std::move(name));
         }
     link->listed.clear();
-    if (!walks.empty() && link->routers_are_due)
-        (void)send_queries(link, bn_query_iterate, walks, bn_qf_subtree, &link->routers, single_nodes);
+    link->gathered.clear();
+    if (!link->unasked.empty())
+        ask_about_routers(link);
     if (!owners.empty() && wants_owners(link))
         (void)send_queries(link, bn_query_get, owners, 0, &link->owners);
 }
@@ -450,6 +469,14 @@ void digest(mgmt_link *link) {
     if (configured) {
         take_configuration(link, &next);
         ask_routers_now(link);
+    }
+    if (link->has_states) {
+        link->gathered.insert(link->gathered.end(), link->states.begin(), link->states.end());
+        link->has_states = link->unasked.empty();
+        if (link->has_states)
+            link->states = std::move(link->gathered);
+        else
+            ask_about_routers(link);
     }
     const bool answered = link->has_listed || link->has_states;
     if (link->has_listed)
