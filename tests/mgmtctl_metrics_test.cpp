@@ -10,6 +10,7 @@
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/metrics.h"
+#include "peers/nodes/schema.h"
 
 static const std::string STATES = "/qv/wccpd/wccp/srv_grp/state";
 
@@ -22,6 +23,13 @@ static metric_source answered_by(const std::vector<ctl_binding> &nodes) {
                     out->bindings.push_back(node);
         return true;
     };
+}
+
+static std::string text_of(const metric_lines &samples, metric_format format) {
+    std::string out;
+    for (const std::string &piece : metrics_text(samples, format))
+        out += piece;
+    return out;
 }
 
 // Numbers from outside stay numbers, texts stay within their labels, and a daemon that is gone is said to be.
@@ -51,7 +59,7 @@ TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
         {NODE_PROCESSES "/wccpd/restarts", "uint32", "2"}};
     metric_lines samples;
     ASSERT_TRUE(gather_metrics(answered_by(known), &samples));
-    const std::string modern = "\n" + metrics_text(samples, metric_format::openmetrics);
+    const std::string modern = "\n" + text_of(samples, metric_format::openmetrics);
     for (const char *line :
          {"wccp_build_info{version=\"1.0.0\"} 1", "# TYPE wccp_build info", "wccp_rx_failures_total 9",
           "wccp_interface_link_downs_total{interface=\"eth0\"} 4",
@@ -73,19 +81,19 @@ TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
         EXPECT_EQ(modern.find(none), std::string::npos) << none;
     EXPECT_NE(modern.find("source=\"a\\\"b"), std::string::npos) << modern;
     EXPECT_TRUE(modern.ends_with("\n# EOF\n"));
-    EXPECT_NE(metrics_text(samples, metric_format::text).find("# TYPE wccp_group_rx_icus_total counter\n"),
+    EXPECT_NE(text_of(samples, metric_format::text).find("# TYPE wccp_group_rx_icus_total counter\n"),
               std::string::npos);
 
     const std::vector<ctl_binding> empty;
     samples = {};
     ASSERT_TRUE(gather_metrics(answered_by(empty), &samples));
-    EXPECT_NE(metrics_text(samples, metric_format::text).find("wccp_daemon_up{daemon=\"wccpd\"} 0\n"),
+    EXPECT_NE(text_of(samples, metric_format::text).find("wccp_daemon_up{daemon=\"wccpd\"} 0\n"),
               std::string::npos);
     samples = {};
     const auto silent = [](ctl_walk, const std::vector<std::string> &, ctl_reply *) { return false; };
     EXPECT_FALSE(gather_metrics(silent, &samples));
-    EXPECT_EQ(metrics_text(samples, metric_format::text).find("wccp_daemon_up{daemon=\"mgmtd\"} 0\n"),
-              metrics_text(samples, metric_format::text).size() - 33);
+    EXPECT_EQ(text_of(samples, metric_format::text).find("wccp_daemon_up{daemon=\"mgmtd\"} 0\n"),
+              text_of(samples, metric_format::text).size() - 33);
 }
 
 static std::string text_of_file(const std::string &name) {
@@ -125,5 +133,42 @@ TEST(Metrics, AreTheOnesThatOthersName) {
                         names.contains("wccp_group_" + at->str(1) + "_total"))
                 << at->str(1) << " of " << file;
         EXPECT_GT(found, 8u) << file;
+    }
+}
+
+// --- Nodes
+
+// Every node that there can be is in the documents, and no other state node is.
+TEST(Nodes, AreInTheDocuments) {
+    static const std::set<std::string> ways = {"in",  "to_proxy",  "bypassed", "returned", "down",
+                                               "own", "forwarded", "dropped",  "passed",   "overload"};
+    const std::string document = text_of_file("docs/states.md");
+    std::set<std::string> documented, wanted;
+    const std::regex row("\n\\| (/qv/(wccpd|tunneld)/[^ ]+) \\|");
+    for (std::sregex_iterator at(document.begin(), document.end(), row), end; at != end; ++at)
+        documented.insert(at->str(1));
+    for (const auto *list : {&wccpd_state_nodes(), &tunneld_state_nodes()})
+        for (const std::string node : *list) {
+            std::string last = node.substr(node.rfind('/') + 1);
+            const std::string above = node.substr(0, node.rfind('/'));
+            if (last.ends_with("_bytes"))
+                last.resize(last.size() - 6);
+            const bool sorted =
+                above.ends_with("/*") && ways.contains(last) && above.find("/member/") == std::string::npos;
+            // A node that only names what is below it needs no row.
+            if (sorted || last != "*" || documented.contains(node))
+                wanted.insert(sorted ? above + "/WAY" : node);
+            else
+                EXPECT_TRUE(std::ranges::any_of(*list, [&](const char *other) {
+                    return std::string(other).starts_with(node + "/");
+                })) << node;
+        }
+    EXPECT_EQ(documented, wanted);
+
+    const std::string configured = text_of_file("docs/mgmtd.md");
+    for (const schema_row &one : schema()) {
+        const std::string last = one.parts.parts.back();
+        EXPECT_TRUE(last == "*" || std::regex_search(configured, std::regex("/" + last + "[ ,]")))
+            << one.pattern;
     }
 }

@@ -135,11 +135,20 @@ chmod 755 $here/root/etc/wccpd/notify.d/record
 inside systemctl enable --now wccp-notify >/dev/null 2>&1 && until_true 10 grep -qx 'wccp-notify role 51 ACTIVE ' "$notified" ||
     die "no notification: $(cat "$notified"; inside journalctl -qu wccp-notify)"
 
-for unit in "${services[@]}" wccp-notify; do
+for unit in "${services[@]}" wccp-notify wccp-metrics@0.service; do
     inside systemd-analyze security --no-pager "$unit" >$here/security 2>&1
     level=$(sed -n 's/.*exposure level for .*: \([0-9.]*\) .*/\1/p' $here/security)
     echo "$unit: exposure $level"
     [ -n "$level" ] && awk "BEGIN { exit !($level < 3.0) }" || { cat $here/security; die "$unit has too many privileges"; }
+done
+
+# Metrics over HTTP, once the administrator enables them.
+[ "$(inside systemctl is-enabled wccp-metrics.socket)" = disabled ] || die "metrics are served by default"
+inside systemctl enable -q --now wccp-metrics.socket || die "no socket for metrics"
+for at in http://127.0.0.1:9815/metrics '--unix-socket /run/wccp-metrics.sock http://localhost/metrics'; do
+    # shellcheck disable=SC2086
+    inside curl -s $at >$here/metrics
+    grep -q '^wccp_group_active{group="51"} 1' $here/metrics || die "no metrics at $at: $(cat $here/metrics)"
 done
 
 # A tunneld that is killed is replaced without wccpd noticing; one that exits makes wccpd restart. Programs that hang are

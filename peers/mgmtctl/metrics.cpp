@@ -18,6 +18,7 @@ namespace {
 constexpr size_t LABEL_MAX = 200, GROUPS_MAX = 256, LINES_MAX = 400; // of a text
 constexpr size_t GROUPS_AT_ONCE = 32; // in one request: the answer is at most 400 KB
 constexpr size_t WORDS_MAX = 8;       // of a line
+constexpr size_t SAMPLE_MAX = 1024;     // of a sample
 
 // The value of a sample by the text of its node; false: the node gives none.
 using metric_value = bool (*)(const std::string &text, std::string *out_value);
@@ -96,6 +97,9 @@ struct gathering {
     void add(size_t family, std::string_view labels, std::string_view value) const {
         const metric_family &about = metric_families[family];
         std::string *lines = &(*out)[family];
+        // Megabytes are neither copied often nor touched before they are needed.
+        if (lines->capacity() - lines->size() < SAMPLE_MAX)
+            lines->reserve(std::max(lines->capacity() * 8, 2 * SAMPLE_MAX));
         lines->append(about.name);
         if (about.kind != metric_kind::gauge)
             lines->append(about.kind == metric_kind::counter ? "_total" : "_info");
@@ -112,10 +116,10 @@ struct gathering {
 
 void add_label(std::string *inout, std::string_view name, std::string_view value) {
     inout->append(inout->empty() ? "" : ",").append(name).append("=\"");
-    for (const char c : clean_text(std::string(value), LABEL_MAX)) {
+    for (const char c : value.substr(0, LABEL_MAX)) {
         if (c == '"' || c == '\\')
             *inout += '\\';
-        *inout += c;
+        *inout += c < 0x20 || c > 0x7e ? '?' : c;
     }
     *inout += '"';
 }
@@ -350,9 +354,9 @@ bool gather_metrics(const metric_source &source, metric_lines *out) {
     return false;
 }
 
-std::string metrics_text(const metric_lines &samples, metric_format format) {
+std::vector<std::string> metrics_text(metric_lines samples, metric_format format) {
     const bool modern = format == metric_format::openmetrics;
-    std::string out;
+    std::vector<std::string> out;
     for (size_t i = 0; i < samples.size(); i++) {
         if (samples[i].empty())
             continue;
@@ -363,16 +367,20 @@ std::string metrics_text(const metric_lines &samples, metric_format format) {
             name += "_total";
         if (!modern && family.kind == metric_kind::info)
             name += "_info";
-        out.append("# TYPE ").append(name);
-        out += family.kind == metric_kind::counter          ? " counter\n"
-               : modern && family.kind == metric_kind::info ? " info\n"
-                                                            : " gauge\n";
+        std::string about = "# TYPE " + name;
+        about += family.kind == metric_kind::counter          ? " counter\n"
+                 : modern && family.kind == metric_kind::info ? " info\n"
+                                                              : " gauge\n";
         for (const char *unit : {"seconds", "bytes"})
             if (modern && family.name.ends_with(std::string("_") + unit))
-                out.append("# UNIT ").append(name).append(" ").append(unit).append("\n");
-        out.append("# HELP ").append(name).append(" ").append(family.help).append("\n").append(samples[i]);
+                about.append("# UNIT ").append(name).append(" ").append(unit).append("\n");
+        about.append("# HELP ").append(name).append(" ").append(family.help).append("\n");
+        out.push_back(std::move(about));
+        out.push_back(std::move(samples[i]));
     }
-    return out + (modern ? "# EOF\n" : "");
+    if (modern)
+        out.push_back("# EOF\n");
+    return out;
 }
 
 const char *metrics_content_type(metric_format format) {

@@ -21,7 +21,8 @@ using metric_source =
 bool gather_metrics(const metric_source &source, metric_lines *out);
 
 enum class metric_format { openmetrics, text };
-std::string metrics_text(const metric_lines &samples, metric_format format);
+// The pieces of the text, one after the other.
+std::vector<std::string> metrics_text(metric_lines samples, metric_format format);
 const char *metrics_content_type(metric_format format);
 
 // One HTTP request on standard input, its answer on standard output, as a socket unit starts it for each

@@ -32,10 +32,16 @@ static std::string read_request() {
     return request;
 }
 
-static int answer_request(const char *status, const char *type, const std::string &body, bool with_body,
-                          int code) {
-    put("HTTP/1.1 " + std::string(status) + "\r\nContent-Type: " + type + "\r\nContent-Length: " +
-        std::to_string(body.size()) + "\r\nConnection: close\r\n\r\n" + (with_body ? body : ""));
+static int answer_request(const char *status, const char *type, const std::vector<std::string> &body,
+                          bool with_body, int code) {
+    size_t length = 0;
+    for (const std::string &piece : body)
+        length += piece.size();
+    put("HTTP/1.1 " + std::string(status) + "\r\nContent-Type: " + type +
+        "\r\nContent-Length: " + std::to_string(length) + "\r\nConnection: close\r\n\r\n");
+    for (const std::string &piece : body)
+        if (with_body)
+            put(piece);
     return code;
 }
 
@@ -51,22 +57,22 @@ int serve_metrics_request(const ctl_link &link) {
     const std::string request = read_request();
     const size_t end = request.find("\r\n");
     if (end == std::string::npos || request.find("\r\n\r\n") == std::string::npos)
-        return answer_request("400 Bad Request", PLAIN, "no complete request\n", true, CTL_USAGE);
+        return answer_request("400 Bad Request", PLAIN, {"no complete request\n"}, true, CTL_USAGE);
     const std::string first = request.substr(0, end);
     const bool head = first.starts_with("HEAD ");
     if (!head && !first.starts_with("GET "))
-        return answer_request("405 Method Not Allowed", PLAIN, "GET and HEAD only\n", true, CTL_USAGE);
+        return answer_request("405 Method Not Allowed", PLAIN, {"GET and HEAD only\n"}, true, CTL_USAGE);
     const size_t from = first.find(' ') + 1, to = first.find(' ', from);
     if (first.substr(from, to - from) != "/metrics")
-        return answer_request("404 Not Found", PLAIN, "the metrics are at /metrics\n", !head, CTL_USAGE);
+        return answer_request("404 Not Found", PLAIN, {"the metrics are at /metrics\n"}, !head, CTL_USAGE);
     const metric_format format = request.find("application/openmetrics-text") != std::string::npos
                                      ? metric_format::openmetrics
                                      : metric_format::text;
     // A mgmtd that does not answer is what the samples say then.
     metric_lines samples;
     (void)gather_metrics(asking(link), &samples);
-    return answer_request("200 OK", metrics_content_type(format), metrics_text(samples, format), !head,
-                          CTL_OK);
+    return answer_request("200 OK", metrics_content_type(format), metrics_text(std::move(samples), format),
+                          !head, CTL_OK);
 }
 
 int ctl_metrics(const ctl_options &options, bool text, bool http) {
@@ -75,6 +81,8 @@ int ctl_metrics(const ctl_options &options, bool text, bool http) {
         return serve_metrics_request(link);
     metric_lines samples;
     const bool answered = gather_metrics(asking(link), &samples);
-    put(metrics_text(samples, text ? metric_format::text : metric_format::openmetrics));
+    for (const std::string &piece :
+         metrics_text(std::move(samples), text ? metric_format::text : metric_format::openmetrics))
+        put(piece);
     return answered ? CTL_OK : CTL_UNREACHABLE;
 }
