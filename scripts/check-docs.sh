@@ -4,8 +4,12 @@
 #   Files     paths that begin with a directory of the tree, and bare names of source files and scripts
 #   mgmtctl   commands, against peers/mgmtctl/main.cpp; their words and options, against the strings in its sources.
 #             Each command has to be in docs/mgmtctl.md
-#   Options   of mgmtd, tunneld and the scripts, against their sources
+#   Options   of mgmtd, tunneld and the scripts, against their sources. The manual pages have to have each
+#   Variables of the environment, against the scripts and sources
 #   Steps     of scripts/test.sh: each has to be in CONTRIBUTING.md
+#   Keys      of JSON, and exit codes: each has to be in docs/mgmtctl.md
+# Every document has to be linked from another one, and every directory to be in README.md. Unit tests compare the tables
+# of reasons, metrics and nodes with the sources.
 set -eu
 cd "$(dirname "$0")/.."
 documents=(README.md CONTRIBUTING.md CHANGELOG.md docs/*.md)
@@ -82,10 +86,42 @@ check_options() { # DOCUMENT
             if (match($i, /--[a-z][a-z-]*/)) print $1, substr($i, RSTART, RLENGTH) }' | sort -u)
 }
 
+check_variables() { # DOCUMENT
+    local name
+    while read -r name; do
+        git grep -qw "$name" -- ':!*.md' || missing "$1" "nothing reads $name"
+    done < <(quotations "$1" | grep -oE '\b(LAB|FLEET|WCCP|METRICS|TUNNELD)_[A-Z_]*[A-Z]\b' | sort -u)
+}
+check_manual() { # PROGRAM PAGE
+    local option options
+    options=$(grep -oE '"--[a-z-]+"' "peers/$1/main.cpp" | tr -d '"' | sort -u)
+    # The manual page of mgmtctl leaves the options of its commands to their --help.
+    [ "$1" = mgmtctl ] || for option in $options; do
+        grep -qF -e "${option//-/\\-}" "$2" || missing "$2" "$1 has an option $option"
+    done
+    for option in $(grep -oE '\\-\\-[a-z]+(\\-[a-z]+)*' "$2" | tr -d '\\' | sort -u); do
+        [ "$option" = --help ] || grep -qx -e "$option" <<<"$options" || missing "$2" "$1 has no option $option"
+    done
+}
+
 for document in "${documents[@]}"; do
     check_files "$document"
     check_words "$document"
     check_options "$document"
+    check_variables "$document"
+done
+for program in mgmtd tunneld mgmtctl; do check_manual "$program" docs/man/"$program".[18]; done
+for document in docs/*.md; do
+    grep -qE "(docs/|\()${document##*/}" "${documents[@]}" || missing "$document" "no other document names it"
+done
+for directory in $(sed -n 's,/.*,,p' <<<"$tree" | grep -v '^\.' | sort -u); do
+    grep -q "^|.*\`$directory/\`" README.md || missing README.md "there is a directory $directory"
+done
+for code in $(sed -n 's/^ *CTL_[A-Z_]* = \([0-9]*\),.*/\1/p' peers/mgmtctl/commands.h | sort -u); do
+    grep -q "^| $code | " docs/mgmtctl.md || missing docs/mgmtctl.md "there is an exit code $code"
+done
+for key in $(grep -ohE '\{"[a-z_]+",|\["[a-z_]+"\]' peers/mgmtctl/{show,traffic}_json.cpp | grep -oE '[a-z_]+' | sort -u); do
+    grep -q "\`$key\`" docs/mgmtctl.md || missing docs/mgmtctl.md "JSON has a key $key"
 done
 for command in $commands; do
     grep -qE "^\| [^|]*\`${command}[\` ]" docs/mgmtctl.md || missing docs/mgmtctl.md "mgmtctl has a command $command"
