@@ -48,8 +48,7 @@ std::string text_of_event(const wire &frame) {
         return "unreadable";
     std::string text = ts_str(event.pointer->text);
     for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(event.pointer->nodes); i++) {
-        const bn_binding *binding =
-            bn_request_per_node_array_get_quick(event.pointer->nodes, i)->binding;
+        const bn_binding *binding = bn_request_per_node_array_get_quick(event.pointer->nodes, i)->binding;
         uint32_t type = 0;
         EXPECT_EQ(bn_binding_get_type(binding, bn_attrib_value, &type, nullptr), LC_OK);
         text += std::string(type == bn_type_str ? " " : " (number) ") + bn_binding_get_name_quick(binding) +

@@ -18,7 +18,7 @@ namespace {
 constexpr size_t LABEL_MAX = 200, GROUPS_MAX = 256, LINES_MAX = 400; // of a text
 constexpr size_t GROUPS_AT_ONCE = 32; // in one request: the answer is at most 400 KB
 constexpr size_t WORDS_MAX = 8;       // of a line
-constexpr size_t SAMPLE_MAX = 1024;     // of a sample
+constexpr size_t SAMPLE_MAX = 1024;   // of a sample
 
 // The value of a sample by the text of its node; false: the node gives none.
 using metric_value = bool (*)(const std::string &text, std::string *out_value);
