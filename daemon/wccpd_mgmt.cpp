@@ -65,11 +65,13 @@ lc_status wccpd_mgmt_handle_query_request(gcl_session *session, bn_request_msg *
         LC_LOG(LC_LOG_INFO, "Discard event req because init not ready");
         return LC_OK;
     }
-    bool in_walk = false; // mgmtd asks for a whole subtree
-    for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(request->nodes); i++)
-        in_walk =
-            in_walk || bn_request_per_node_array_get_quick(request->nodes, i)->subop == bn_query_iterate;
-    CHECK_STATUS(mdc_dispatch_mon_request(session, request, wccpd_mon_handle_get, &in_walk,
+    wccpd_mon_request how = {};
+    for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(request->nodes); i++) {
+        const bn_request_node *node = bn_request_per_node_array_get_quick(request->nodes, i);
+        how.in_walk = how.in_walk || node->subop == bn_query_iterate;
+        how.quiet = how.quiet || (node->flags & bn_qf_quiet) != 0;
+    }
+    CHECK_STATUS(mdc_dispatch_mon_request(session, request, wccpd_mon_handle_get, &how,
                                           wccpd_mon_handle_iterate, nullptr));
     return LC_OK;
 }

@@ -151,6 +151,8 @@ const mon_dump owners_dump = {WCCP_OWNERS_BYTES,
      WRITE_VALUE(put_words(out, wccp_reason_word(s->reason.reason.code))), nullptr, ask_reason},             \
         {root "/reason/*/sender", bn_type_ipv4addr, WRITE_VALUE(put_address(s->reason.reason.sender, out)),  \
          nullptr, ask_reason},                                                                               \
+        {root "/reason/*/source", bn_type_ipv4addr, WRITE_VALUE(put_address(s->reason.reason.source, out)),  \
+         nullptr, ask_reason},                                                                               \
         {root "/reason/*/offered", bn_type_str, WRITE_VALUE(put_words(out, s->reason.reason.offered.s)),     \
          nullptr, ask_reason},                                                                               \
         {root "/reason/*/wanted", bn_type_str, WRITE_VALUE(put_words(out, s->reason.reason.wanted.s)),       \
@@ -306,7 +308,8 @@ struct dump_failures_logged_at {
     int32_t before;
 };
 
-lc_status append_dump(const mon_subject *subject, const mon_node *node, bool in_walk, bn_binding_array *out) {
+lc_status append_dump(const mon_subject *subject, const mon_node *node, const wccpd_mon_request &request,
+                      bn_binding_array *out) {
     const mon_dump *dump = node->dump;
     owned<void, wccp_free> memory(wccp_malloc(dump->size));
     if (!memory.pointer) {
@@ -315,7 +318,9 @@ lc_status append_dump(const mon_subject *subject, const mon_node *node, bool in_
     }
     csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.pointer, dump->size);
     CHECK_NULL(buffer);
-    const dump_failures_logged_at level(in_walk ? LC_LOG_INFO : LC_LOG_ERR); // for this dump
+    const dump_failures_logged_at level(request.quiet     ? LC_LOG_DEBUG
+                                        : request.in_walk ? LC_LOG_INFO
+                                                          : LC_LOG_ERR); // for this dump
     if (dump->print(buffer, subject->group) != 0 && !dump->cut_text_counts)
         return LC_OK;
     CHECK_STATUS(append_binding(subject->name, node->type, csys_display_buf_text(buffer), out));
@@ -324,11 +329,14 @@ lc_status append_dump(const mon_subject *subject, const mon_node *node, bool in_
 
 } // namespace
 
-lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_parts, void *in_walk,
+lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_parts, void *data,
                                bn_binding_array *out) {
-    LC_LOG(LC_LOG_INFO, "MonGet %s", node_name);
+    const wccpd_mon_request request =
+        data ? *static_cast<const wccpd_mon_request *>(data) : wccpd_mon_request{};
+    const int32_t level = request.quiet ? LC_LOG_DEBUG : LC_LOG_INFO;
+    LC_LOG(level, "MonGet %s", node_name);
     if (!wccpd_is_under(node_name, NODE_WCCPD)) {
-        LC_LOG(LC_LOG_INFO, "MonGet not for wccpd, bailing - %s", node_name);
+        LC_LOG(level, "MonGet not for wccpd, bailing - %s", node_name);
         return LC_OK;
     }
     mon_subject subject = {};
@@ -337,7 +345,7 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
     const uint32_t count = tstr_array_length_quick(name_parts);
     const char *last = count ? tstr_array_get_str_quick(name_parts, count - 1) : nullptr;
     CHECK_NULL(last);
-    LC_LOG(LC_LOG_INFO, "MonGet: last_name_part=%s", last);
+    LC_LOG(level, "MonGet: last_name_part=%s", last);
     for (const char *pattern : wildcard_nodes)
         if (name_matches(&subject, pattern)) {
             CHECK_STATUS(wccpd_mon_handle_get_wildcard(&subject, last, out));
@@ -351,7 +359,7 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
         if (!name_matches(&subject, node.pattern))
             continue;
         if (node.dump) {
-            CHECK_STATUS(append_dump(&subject, &node, in_walk && *static_cast<const bool *>(in_walk), out));
+            CHECK_STATUS(append_dump(&subject, &node, request, out));
             return LC_OK;
         }
         if (node.ask)

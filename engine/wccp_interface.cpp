@@ -49,10 +49,13 @@ wccp_interface *wccp_if_add_interface(const char *name) {
     wccp_interface *interface = &wccp_g.interfaces[wccp_g.if_count];
     clear_interface(interface);
     strlcpy(interface->name, name, sizeof interface->name);
+    const bool primary = strncmp(interface->name, wccp_primary_wan_interface_name, WCCP_IF_NAME_BYTES) == 0;
     interface->ipa = wccp_get_address(interface->name);
-    interface->link_up = wccp_get_if_status(interface->name);
+    // The primary interface is here whether a group uses it or not: its absence is worth no warning.
+    if (!primary || wccp_get_device(interface->name) != 0)
+        interface->link_up = wccp_get_if_status(interface->name);
     wccp_g.if_count++;
-    if (strncmp(interface->name, wccp_primary_wan_interface_name, WCCP_IF_NAME_BYTES) == 0)
+    if (primary)
         wccp_g.primary_if = interface;
     if (interface->link_up)
         interface->ready_flags |= WCCP_LINK_READY;

@@ -19,8 +19,8 @@
 
 #include "runtime/csys.h"
 
-// Bytes of the longest texts: 9 gauges, 20 counters, 32 routers, 32 appliances and 40 reasons; 4 counters, 127
-// interfaces and 16 reasons.
+// Bytes of the longest texts: 9 gauges, 21 counters, 32 routers, 32 appliances and 40 reasons; 4 counters,
+// 127 interfaces and 16 reasons.
 constexpr uint32_t WCCP_METRICS_BYTES = 12288;
 
 // They take the engine lock. 0, or 1 when `buffer` is null, there is no such group, or the text did not fit.

@@ -52,9 +52,12 @@ int32_t send_datagram(wccp_service_group *group, int fd, const wccp_pkt *pkt, be
     if (sent < 0) {
         const int error = errno;
         const char *words = strerrordesc_np(error);
-        wccp_note_reason(group, WCCP_REASON_SEND_FAILED, address,
-                         wccp_reason_value("%s", words ? words : "unknown error"),
-                         wccp_reason_value("%u bytes", pkt->length));
+        group->tx_send_errors++;
+        if (wccp_note_reason(group, WCCP_REASON_SEND_FAILED, address,
+                             wccp_reason_value("%s", words ? words : "unknown error"),
+                             wccp_reason_value("%u bytes", pkt->length)))
+            QV_LOG(LC_LOG_WARNING, "WCCP GRP %d: sending to %s fails: %s", group->id, addr_text(address).s,
+                   words ? words : "unknown error");
         errno = error;
     } else {
         wccp_forget_reason(group, WCCP_REASON_SEND_FAILED, address);

@@ -54,6 +54,7 @@ struct icu_message {
     be32 receive_id;
     wccp_rtr_view_info view;
     wccp_rtr_capabilities offered;
+    bool has_capabilities; // the message has that component
     wccp_assign_map_info map;
 };
 
@@ -69,6 +70,7 @@ int read_command_extension(wccp_service_group *group, wccp_pkt *pkt, icu_message
     return status;
 }
 int read_capabilities(wccp_service_group *group, wccp_pkt *pkt, icu_message *icu) {
+    icu->has_capabilities = true;
     return wccp_pkt_unload_capability_info_component(group, pkt, &icu->offered);
 }
 
@@ -148,8 +150,11 @@ int read_i_see_you(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_ser
 wccp_sending_router *find_or_create_router(wccp_service_group *group, const icu_message *icu,
                                            int *out_status) {
     *out_status = 0;
-    if (wccp_sending_router *router = wccp_find_sending_router(group, icu->router_id))
-        return router; // what it offers now has no effect
+    if (wccp_sending_router *router = wccp_find_sending_router(group, icu->router_id)) {
+        if (icu->has_capabilities)
+            wccp_check_offered_methods(group, icu->router_id, &icu->offered);
+        return router;
+    }
     wccp_rtr_capabilities agreed;
     uint32_t compatible;
     *out_status =
@@ -254,9 +259,11 @@ void note_method_differences(wccp_service_group *group, const wccp_sending_route
 
 void note_missing_listing(wccp_service_group *group, const wccp_sending_router *router) {
     if (!(router->flags & WCCP_RTR_TWO_WAY))
-        wccp_note_reason(group, WCCP_REASON_NOT_IN_VIEW, router->router_id,
-                         wccp_reason_value("%u appliances", router->view_appliance_count),
-                         wccp_reason_value("%s", addr_text(group->appliance_ipa).s));
+        wccp_note_reason(
+            group, WCCP_REASON_NOT_IN_VIEW, router->router_id,
+            wccp_reason_value(router->view_appliance_count == 1 ? "%u appliance" : "%u appliances",
+                              router->view_appliance_count),
+            wccp_reason_value("%s", addr_text(group->appliance_ipa).s));
 }
 
 } // namespace
@@ -368,6 +375,7 @@ bool check_security(wccp_service_group *group, const wccp_pkt *pkt, const wccp_w
 } // namespace
 
 int wccp_process_received_packet(wccp_pkt *pkt) {
+    const wccp_packet_source_scope source(pkt->ipa);
     const wccp_wire_msg_header *header;
     if (wccp_pkt_unload_msg_header(pkt, &header)) {
         log_failed_step("unloading msg header", 1);
@@ -380,8 +388,8 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
             "WCCP: message header length (%d) and actual packet length (%d) do not match. sender ip: %s",
             to_host(header->length), static_cast<int>(pkt->length), addr_text(pkt->ipa).s);
         wccp_note_reason(nullptr, WCCP_REASON_MESSAGE_LENGTH, pkt->ipa,
-                         wccp_reason_value("%u bytes in its header", claimed),
-                         wccp_reason_value("%u bytes received", pkt->length));
+                         wccp_reason_value("%u bytes by its header", claimed),
+                         wccp_reason_value("%u bytes were received", pkt->length));
         return 0;
     }
     if (to_host(header->version) != WCCP_VERSION) {

@@ -245,6 +245,7 @@ constexpr struct {
     {"tx_removal_replies", &wccp_service_group::tx_removal_replies},
     {"tx_failures", &wccp_service_group::tx_failures},
     {"tx_build_failures", &wccp_service_group::tx_build_failures},
+    {"tx_send_errors", &wccp_service_group::tx_send_errors},
     {"tx_link_drops", &wccp_service_group::tx_link_drops},
     {"routers_timed_out", &wccp_service_group::routers_timed_out},
     {"transitions", &wccp_service_group::transitions},

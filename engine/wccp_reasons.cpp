@@ -10,58 +10,64 @@
 
 namespace {
 
+// When a reason ends.
+enum class ending {
+    step,       // with the step that succeeds
+    acceptance, // with the next I-See-You of its sender that is accepted
+    time,       // when nothing has repeated it for REPEATED_WITHIN
+    acceptance_or_time,
+};
 struct code_row {
     const char *word;
-    bool of_packets;      // ends with the next I-See-You of the sender that is accepted
-    bool lasting = false; // does not end after REPEATED_WITHIN either
+    ending ends;
 };
 constexpr uint32_t REPEATED_WITHIN = 60; // seconds; a refused router repeats its packet after ten
 
 // Indexed by wccp_reason_code.
 constexpr code_row code_rows[] = {
-    {"", false},
-    {"message-length", true},
-    {"message-version", true},
-    {"message-type", true},
-    {"message-malformed", true},
-    {"view-length", true},
-    {"group-unknown", true},
-    {"group-disabled", true},
-    {"group-stopped", true},
-    {"security-missing", true},
-    {"security-unwanted", true},
-    {"password-mismatch", true},
-    {"service-mismatch", true},
-    {"forwarding-not-offered", true},
-    {"assignment-not-offered", true},
-    {"return-not-offered", true},
-    {"router-id-zero", true},
-    {"routers-exhausted", true},
-    {"query-refused", true},
-    {"not-in-view", true},
-    {"router-silent", true, true},
-    {"election-blocked", false},
-    {"method-differs", true},
-    {"mask-differs", true},
-    {"assignment-unreadable", true},
-    {"assignment-differs", false},
-    {"not-acknowledged", false},
-    {"appliance-left-out", false},
-    {"no-memory", true},
-    {"here-i-am-not-built", false},
-    {"table-not-built", false},
-    {"send-failed", false},
-    {"interface-missing", false},
-    {"interface-down", false},
-    {"interface-no-address", false},
-    {"port-taken", false},
-    {"socket-failed", false},
-    {"join-failed", false},
-    {"tunnel-refused", true},
-    {"tunnel-timeout", true},
-    {"tunnel-ids-exhausted", true},
-    {"tunneld-silent", true, true},
-    {"mailbox-missing", true},
+    {"", ending::step},
+    {"message-length", ending::time},
+    {"message-version", ending::acceptance_or_time},
+    {"message-type", ending::acceptance_or_time},
+    {"message-malformed", ending::time},
+    {"view-length", ending::time},
+    {"group-unknown", ending::acceptance_or_time},
+    {"group-disabled", ending::acceptance_or_time},
+    {"group-stopped", ending::acceptance_or_time},
+    {"security-missing", ending::acceptance_or_time},
+    {"security-unwanted", ending::acceptance_or_time},
+    {"password-mismatch", ending::acceptance_or_time},
+    {"service-mismatch", ending::acceptance_or_time},
+    {"forwarding-not-offered", ending::acceptance_or_time},
+    {"assignment-not-offered", ending::acceptance_or_time},
+    {"return-not-offered", ending::acceptance_or_time},
+    {"router-id-zero", ending::acceptance_or_time},
+    {"routers-exhausted", ending::acceptance_or_time},
+    {"query-refused", ending::acceptance_or_time},
+    {"not-in-view", ending::acceptance_or_time},
+    {"router-silent", ending::acceptance},
+    {"election-blocked", ending::step},
+    {"method-differs", ending::acceptance_or_time},
+    {"mask-differs", ending::acceptance_or_time},
+    {"assignment-unreadable", ending::acceptance_or_time},
+    {"assignment-differs", ending::step},
+    {"not-acknowledged", ending::step},
+    {"appliance-left-out", ending::step},
+    {"no-memory", ending::acceptance_or_time},
+    {"here-i-am-not-built", ending::step},
+    {"table-not-built", ending::step},
+    {"send-failed", ending::step},
+    {"interface-missing", ending::step},
+    {"interface-down", ending::step},
+    {"interface-no-address", ending::step},
+    {"port-taken", ending::step},
+    {"socket-failed", ending::step},
+    {"join-failed", ending::step},
+    {"tunnel-refused", ending::acceptance_or_time},
+    {"tunnel-timeout", ending::acceptance_or_time},
+    {"tunnel-ids-exhausted", ending::acceptance_or_time},
+    {"tunneld-silent", ending::acceptance},
+    {"mailbox-missing", ending::acceptance_or_time},
 };
 static_assert(sizeof code_rows / sizeof *code_rows == WCCP_REASON_CODES);
 
@@ -100,7 +106,17 @@ wccp_reason *find_reason(wccp_service_group *group, wccp_reason_code code, be32 
     return nullptr;
 }
 
+thread_local be32 packet_source; // not the engine's: a thread that waits for tunneld releases the lock
+
 } // namespace
+
+wccp_packet_source_scope::wccp_packet_source_scope(be32 source) {
+    packet_source = source;
+}
+
+wccp_packet_source_scope::~wccp_packet_source_scope() {
+    packet_source = {};
+}
 
 const char *wccp_reason_word(uint32_t code) {
     return code < WCCP_REASON_CODES ? code_rows[code].word : "";
@@ -108,8 +124,8 @@ const char *wccp_reason_word(uint32_t code) {
 
 bool wccp_reason_holds(const wccp_reason *reason) {
     const code_row *row = &code_rows[reason->code];
-    return reason->code != WCCP_REASON_NONE &&
-           (!row->of_packets || row->lasting || wccp_g.seconds - reason->last <= REPEATED_WITHIN);
+    const bool by_time = row->ends == ending::acceptance_or_time || row->ends == ending::time;
+    return reason->code != WCCP_REASON_NONE && (!by_time || wccp_g.seconds - reason->last <= REPEATED_WITHIN);
 }
 
 wccp_reason_text wccp_reason_value(const char *format, ...) {
@@ -126,11 +142,13 @@ wccp_reason *wccp_reasons_of(wccp_service_group *group, uint32_t *out_count) {
     return group ? group->reasons : wccp_g.reasons;
 }
 
-void wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sender,
+bool wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sender,
                       const wccp_reason_text &offered, const wccp_reason_text &wanted) {
     wccp_reason *reason = find_reason(group, code, sender);
-    if (!reason) {
-        reason = find_place_for_reason(group);
+    const bool is_new = !reason || !wccp_reason_holds(reason);
+    if (is_new) {
+        if (!reason)
+            reason = find_place_for_reason(group);
         *reason = {};
         reason->code = code;
         reason->sender = sender;
@@ -139,8 +157,10 @@ void wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sen
     }
     reason->count++;
     reason->last = wccp_g.seconds;
+    reason->source = packet_source;
     reason->offered = offered;
     reason->wanted = wanted;
+    return is_new;
 }
 
 void wccp_forget_reason(wccp_service_group *group, wccp_reason_code code, be32 sender) {
@@ -167,7 +187,8 @@ void wccp_forget_all_reasons(wccp_service_group *group) {
 
 void wccp_forget_refusals(wccp_service_group *group, be32 router_id, be32 source) {
     for (wccp_reason &each : group->reasons)
-        if (code_rows[each.code].of_packets && each.last != wccp_g.seconds &&
-            (each.sender == router_id || each.sender == source))
+        if ((code_rows[each.code].ends == ending::acceptance_or_time ||
+             code_rows[each.code].ends == ending::acceptance) &&
+            each.last != wccp_g.seconds && (each.sender == router_id || each.sender == source))
             each.code = WCCP_REASON_NONE;
 }

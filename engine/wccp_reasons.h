@@ -8,7 +8,9 @@
 // one, and those of unknown senders before those of the group's routers, because anybody can send packets.
 //
 // Reasons that come from a router's packets end when an I-See-You of that router is accepted, and most of
-// them also after a minute without a repetition. All others end when the step that failed succeeds.
+// them also after a minute without a repetition. Those about the form of a packet end only after that minute:
+// a router whose table cannot be read also sends messages without one, and these are accepted. All other
+// reasons end when the step that failed succeeds.
 //
 // Lock held for all functions except wccp_reason_word and wccp_reason_value.
 #pragma once
@@ -80,9 +82,18 @@ struct wccp_reason {
     wccp_reason_code code; // NONE: this entry is free
     bool stranger;         // the sender is not a router of the group
     be32 sender;           // router id, source, appliance or destination; 0.0.0.0 for none
+    be32 source;           // of the last packet that caused it; 0.0.0.0 if no packet did
     uint32_t count;
     uint32_t first, last;             // times of the first and last occurrence
     wccp_reason_text offered, wanted; // either may be empty
+};
+
+// Sets `source` of the reasons that the calling thread notes while this object exists. Scopes do not nest.
+struct wccp_packet_source_scope {
+    explicit wccp_packet_source_scope(be32 source);
+    ~wccp_packet_source_scope();
+    wccp_packet_source_scope(const wccp_packet_source_scope &) = delete;
+    wccp_packet_source_scope &operator=(const wccp_packet_source_scope &) = delete;
 };
 
 // The stable word of a code, such as "password-mismatch"; "" for none.
@@ -91,8 +102,9 @@ const char *wccp_reason_word(uint32_t code);
 bool wccp_reason_holds(const wccp_reason *reason);
 // Formats a value; a longer text is truncated.
 __attribute__((format(printf, 1, 2))) wccp_reason_text wccp_reason_value(const char *format, ...);
-// Adds or repeats a reason. Null group: the table for packets that belong to no group.
-void wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sender,
+// Adds or repeats a reason. Null group: the table for packets that belong to no group. True for a new reason,
+// false for another occurrence of an active one.
+bool wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sender,
                       const wccp_reason_text &offered, const wccp_reason_text &wanted);
 void wccp_forget_reason(wccp_service_group *group, wccp_reason_code code, be32 sender); // null group as above
 void wccp_forget_reasons(wccp_service_group *group, wccp_reason_code code);             // of all senders

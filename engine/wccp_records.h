@@ -269,6 +269,7 @@ struct wccp_service_group {
     uint32_t rx_removal_failures;
     uint32_t tx_failures;
     uint32_t tx_build_failures;
+    uint32_t tx_send_errors; // destinations that the kernel refused; not part of tx_failures
     uint32_t rx_auth_failures;
     uint32_t rx_auth_mismatches;
     uint32_t rx_service_mismatches;

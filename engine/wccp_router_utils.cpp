@@ -144,6 +144,16 @@ int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,
     return 0;
 }
 
+void wccp_check_offered_methods(wccp_service_group *group, be32 router_id,
+                                const wccp_rtr_capabilities *offered) {
+    const capabilities in_force = {group->fwd_method, group->assign_method, group->ret_method};
+    for (const capability_step &step : capability_steps)
+        if (in_force.*step.word != WCCP_METHOD_NONE && (in_force.*step.word & offered->*step.word) == 0)
+            wccp_note_reason(group, step.reason, router_id,
+                             wccp_reason_value("%s", step.name(get_offered_method(offered->*step.word))),
+                             wccp_reason_value("%s", step.name(in_force.*step.word)));
+}
+
 wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 router_id,
                                                 const wccp_rtr_capabilities *offered,
                                                 const wccp_rtr_capabilities *agreed) {

@@ -120,8 +120,8 @@ void collect_eligible_appliances(wccp_service_group *group, uint32_t *out_left_o
         if (entry->listing == WCCP_LISTED_BY_ALL) // NOT_LISTED_LOGGED stays as it is
             entry->listing = WCCP_NOT_LISTED_BY_ALL;
         wccp_note_reason(group, WCCP_REASON_APPLIANCE_LEFT_OUT, entry->ipa,
-                         wccp_reason_value("in %u views", entry->ref_count),
-                         wccp_reason_value("in those of all %u routers", group->sending_router_count));
+                         wccp_reason_value("%u", entry->ref_count),
+                         wccp_reason_value("%u", group->sending_router_count));
         ++*out_left_out;
         *out_logged += entry->listing == WCCP_NOT_LISTED_LOGGED;
     }

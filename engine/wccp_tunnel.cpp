@@ -89,11 +89,19 @@ struct tunnel_removal {
     wccp_tunnel *tunnel;
 };
 
-// Notes why an add for a router failed. Engine lock held.
+// Notes why an add for a router failed, instead of an earlier failure of another kind. Engine lock held.
 void note_tunnel_failure(int group, wccp_reason_code code, be32 remote, const wccp_reason_text &offered,
                          const wccp_reason_text &wanted) {
-    if (wccp_service_group *record = wccp_find_group(group))
-        wccp_note_reason(record, code, remote, offered, wanted);
+    static constexpr wccp_reason_code failures[] = {
+        WCCP_REASON_NO_MEMORY,      WCCP_REASON_TUNNEL_IDS_EXHAUSTED, WCCP_REASON_MAILBOX_MISSING,
+        WCCP_REASON_TUNNEL_TIMEOUT, WCCP_REASON_TUNNELD_SILENT,       WCCP_REASON_TUNNEL_REFUSED};
+    wccp_service_group *record = wccp_find_group(group);
+    if (!record)
+        return;
+    for (const wccp_reason_code each : failures)
+        if (each != code)
+            wccp_forget_reason(record, each, remote);
+    wccp_note_reason(record, code, remote, offered, wanted);
 }
 
 } // namespace

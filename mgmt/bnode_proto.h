@@ -47,6 +47,7 @@ enum : uint32_t {
     bn_qf_subtree = 0x1000,      // everything below the node
     bn_qf_include_self = 0x2000, // also the node itself
     bn_qf_leaves_only = 0x4000,  // only nodes without children
+    bn_qf_quiet = 0x8000,        // the query is repeated all the time: daemons log it at debug level only
 };
 // Commit flags of a set request. The request's text may be the purpose of the commit, and its number the
 // revision that the change was made for: mgmtd refuses it if the configuration has another revision by then.

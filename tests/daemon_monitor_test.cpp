@@ -27,7 +27,8 @@ std::string get(const std::string &name, bool in_walk = false) {
     owner<tstr_array, tstr_array_free> parts;
     EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
     binding_list out;
-    const lc_status status = wccpd_mon_handle_get(name.c_str(), parts, &in_walk, out.array);
+    wccpd_mon_request request = {in_walk, false};
+    const lc_status status = wccpd_mon_handle_get(name.c_str(), parts, &request, out.array);
     const uint32_t count = bn_binding_array_length_quick(out.array);
     if (status != LC_OK || count != 1)
         return status ? "status " + std::to_string(status) : count ? "several" : NOTHING;

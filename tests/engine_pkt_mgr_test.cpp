@@ -115,7 +115,7 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {bytes(7, 0), 1, all, "WCCP: unloading msg header failed.",
          "message-malformed 10.0.0.1: a header of 7 bytes|8 bytes"},
         {longer, 0, none, "do not match. sender ip: 10.0.0.1",
-         "message-length 10.0.0.1: 168 bytes in its header|169 bytes received"},
+         "message-length 10.0.0.1: 168 bytes by its header|169 bytes were received"},
         {bytes(good.begin(), good.end() - 1), 0, none,
          "WCCP: message header length (160) and actual packet length (167) do not match. sender ip: "
          "10.0.0.1",
@@ -416,7 +416,7 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     take_reasons(group);
     process(icu(2, view(2, {{101, 50, 0xff}}), {by_mask}));
     EXPECT_EQ(take_reasons(group), "method-differs 10.0.0.2: hash by the router|mask x2; "
-                                   "not-in-view 10.0.0.2: 1 appliances|10.0.0.100");
+                                   "not-in-view 10.0.0.2: 1 appliance|10.0.0.100");
 }
 
 TEST_F(Messages, AMapThatFillsThePacketIsProcessed) {
@@ -502,7 +502,8 @@ TEST_F(Messages, TheDigestDecides) {
     EXPECT_EQ(process(good, ipa(0, 2)), 1);
     for (uint32_t second = 0; second < 2; second++, wccp_g.seconds++)
         process(icu(1, view(1, {{100, 100, 0}})));
-    EXPECT_EQ(take_reasons(group), "security-unwanted 10.0.0.2: MD5|none");
+    EXPECT_EQ(take_reasons(group),
+              "security-unwanted 10.0.0.2: MD5|none; assignment-not-offered 10.0.0.1: hash|mask x2");
     // Reasons of strangers replace those of strangers, not those of the group's routers.
     EXPECT_EQ(process(good), 1);
     for (uint8_t i = 0; i < 100; i++, wccp_g.seconds++)

@@ -105,14 +105,13 @@ TEST_F(StateTest, ElectionsFollowTheViews) {
     } steps[] = {
         {A, {A, B}, {1}, "no", "election-blocked 10.0.0.202: no I-See-You|two-way"},
         {B, {A, B}, {}, "no", "election-blocked 10.0.0.202: one-way|two-way"},
-        {B, {A, B}, {1, 2}, "1 2 1:256", "appliance-left-out 10.0.0.2: in 1 views|in those of all 2 routers"},
+        {B, {A, B}, {1, 2}, "1 2 1:256", "appliance-left-out 10.0.0.2: 1|2"},
         {C, {}, {}, "1 2 1:256"}, // no change of any view
         {B,
          {A, B},
          {1, 3},
          "1 0", // no appliance is reported by all
-         "appliance-left-out 10.0.0.3: in 1 views|in those of all 3 routers; appliance-left-out 10.0.0.1: in "
-         "2 views|in those of all 3 routers"},
+         "appliance-left-out 10.0.0.3: 1|3; appliance-left-out 10.0.0.1: 2|3"},
         {C, {}, {0, 1}, "no"},     // a lower address
         {C, {}, {1}, "1 3 1:256"}, // the key starts again
         {A, {A, B}, {1, 3}, "2 3 1:256"},

@@ -58,6 +58,7 @@ inline constexpr metric_family metric_families[] = {
     {"wccp_group_tx_failures", metric_kind::counter, "group",
      "Messages that could not be built or sent; those dropped for the link are not among them."},
     {"wccp_group_tx_build_failures", metric_kind::counter, "group", "Messages that could not be built."},
+    {"wccp_group_tx_send_errors", metric_kind::counter, "group", "Messages that the kernel refused to send."},
     {"wccp_group_tx_link_drops", metric_kind::counter, "group",
      "Messages not sent because the interface had no link or no address."},
     {"wccp_group_routers_timed_out", metric_kind::counter, "group",

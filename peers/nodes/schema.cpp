@@ -150,8 +150,9 @@ const std::vector<schema_row> &schema() {
 }
 
 #define REASONS(node)                                                                                        \
-    node "/reason/*", node "/reason/*/code", node "/reason/*/sender", node "/reason/*/offered",              \
-        node "/reason/*/wanted", node "/reason/*/count", node "/reason/*/first", node "/reason/*/last"
+    node "/reason/*", node "/reason/*/code", node "/reason/*/sender", node "/reason/*/source",               \
+        node "/reason/*/offered", node "/reason/*/wanted", node "/reason/*/count", node "/reason/*/first",   \
+        node "/reason/*/last"
 
 const std::vector<const char *> &wccpd_state_nodes() {
     static const std::vector<const char *> nodes = {
@@ -219,6 +220,12 @@ const std::vector<const char *> &tunneld_state_nodes() {
         NODE_PLANE_STATE "/clamped",
         NODE_PLANE_STATE "/refused/*",
         NODE_PLANE_STATE "/refused_source/*",
+        NODE_PLANE_STATE "/first_ms/*",
+        NODE_PLANE_STATE "/first_ms/refused_source/*",
+        NODE_PLANE_STATE "/first_ms/overload/*",
+        NODE_PLANE_STATE "/first_ms/unprotected/*",
+        NODE_PLANE_STATE "/last_ms/*",
+        NODE_PLANE_STATE "/last_ms/refused_source/*",
         NODE_TUNNEL_STATE "/*",
         NODE_TUNNEL_STATE "/*/local",
         NODE_TUNNEL_STATE "/*/remote",
