@@ -324,6 +324,10 @@ void tick(tunneld *daemon, int64_t now) {
     daemon->own_addresses = find_own_addresses();
     follow_groups(daemon);
     reconcile(daemon);
+    if (now >= daemon->look_at_counters_ms) {
+        note_occurrences(daemon);
+        daemon->look_at_counters_ms = now + OCCURRENCE_LOOK_MS;
+    }
     if (now >= daemon->alive_at_ms && service_watchdog_ms() >= 0) {
         service_report("WATCHDOG=1");
         daemon->alive_at_ms = now + service_watchdog_ms() / 4;
@@ -485,7 +489,7 @@ bool start_parts(tunneld *daemon) {
     daemon->management = mgmt_link_new(
         daemon->loop,
         {[daemon](const configured_view &view) { take_configuration(daemon, view); },
-         [daemon] { return tunneld_state(*daemon); },
+         [daemon] { return tunneld_state(daemon); },
          [daemon](uint8_t group, const std::string &text) { hear_owners(daemon, group, text); }});
     return daemon->management != nullptr;
 }

@@ -12,6 +12,7 @@
 #include "peers/tunneld/commands.h"
 #include "peers/tunneld/course.h"
 #include "peers/tunneld/health.h"
+#include "peers/tunneld/occurrences.h"
 #include "peers/tunneld/plane.h"
 #include "peers/tunneld/protection.h"
 #include "peers/tunneld/session.h"
@@ -91,6 +92,8 @@ struct tunneld {
     std::map<std::string, uint32_t> indices; // of the links
     std::string failure;                     // of the last reconciling, or ""
     int64_t again_at_ms = 0, retry_delay_ms = 0;
+    occurrences occurred;
+    int64_t look_at_counters_ms = 0;
 };
 
 // Slow starts, drains and limits of all groups: to call once a second.
@@ -104,4 +107,6 @@ std::map<uint8_t, group_cover> protection_cover(const tunneld &daemon, const pla
 // The program, until a signal ends it. The exit code.
 int run_tunneld(const tunneld_options &options);
 // The state nodes, in the order of a walk.
-std::vector<state_node> tunneld_state(const tunneld &daemon);
+std::vector<state_node> tunneld_state(tunneld *daemon);
+// Looks at the counters, and at what lasts.
+void note_occurrences(tunneld *daemon);

@@ -175,16 +175,59 @@ void add_protection(const tunneld &daemon, const plane_counters &plane, const so
     }
 }
 
+// How long ago each began, and was seen last.
+void add_occurrences(const occurrences &occurred, node_writer *writer) {
+    const int64_t now = lt_monotonic_ms();
+    for (const auto &[what, when] : occurred) {
+        writer->count("first_ms/" + what, static_cast<uint64_t>(now - when.first_ms));
+        if (when.last_ms >= 0)
+            writer->count("last_ms/" + what, static_cast<uint64_t>(now - when.last_ms));
+    }
+}
+
+void note_counters(tunneld *daemon, const plane_counters &plane, const sorting_counters &sorting) {
+    const int64_t now = lt_monotonic_ms();
+    uint64_t own = 0, fragments = 0;
+    for (const auto &[name, ways] : sorting.interfaces)
+        own += ways[SORTED_OWN].packets;
+    for (const auto &[ends, packets] : sorting.fragments)
+        fragments += packets;
+    note_counter(&daemon->occurred, "own", own, now);
+    note_counter(&daemon->occurred, "fragments", fragments, now);
+    for (const auto *sources : {&plane.refused_sources, &sorting.refused_sources})
+        for (const auto &[address, packets] : *sources)
+            note_counter(&daemon->occurred, "refused_source/" + address_text(address), packets, now);
+    note_state(&daemon->occurred, "lack", !daemon->lack.empty(), now);
+    note_state(&daemon->occurred, "failure", !daemon->failure.empty(), now);
+    for (const auto &[group, followed] : daemon->followed)
+        note_state(&daemon->occurred, "overload/" + std::to_string(group), followed.decided.overloaded, now);
+    for (const auto &[group, cover] : protection_cover(*daemon, plane))
+        note_state(&daemon->occurred, "unprotected/" + std::to_string(group), !cover.reason.empty(), now);
+}
+
+void read_counters(const tunneld &daemon, plane_counters *plane, sorting_counters *sorting) {
+    std::string error;
+    daemon.plane->read_counters(plane);
+    if (daemon.plane != &table_plane)
+        (void)read_sorting_counters(sorting, &error);
+}
+
 } // namespace
 
-std::vector<state_node> tunneld_state(const tunneld &daemon) {
+void note_occurrences(tunneld *daemon) {
+    plane_counters plane;
+    sorting_counters sorting;
+    read_counters(*daemon, &plane, &sorting);
+    note_counters(daemon, plane, sorting);
+}
+
+std::vector<state_node> tunneld_state(tunneld *daemon_now) {
     std::vector<state_node> out;
     plane_counters plane;
     sorting_counters sorting;
-    std::string error;
-    daemon.plane->read_counters(&plane);
-    if (daemon.plane != &table_plane)
-        (void)read_sorting_counters(&sorting, &error);
+    read_counters(*daemon_now, &plane, &sorting);
+    note_counters(daemon_now, plane, sorting);
+    const tunneld &daemon = *daemon_now;
 
     node_writer writer = {&out, NODE_PLANE_STATE};
     writer.add("name", bn_type_str, daemon.plane->name);
@@ -201,6 +244,7 @@ std::vector<state_node> tunneld_state(const tunneld &daemon) {
     sources.insert(sorting.refused_sources.begin(), sorting.refused_sources.end());
     for (const auto &[address, packets] : sources)
         writer.count("refused_source/" + address_text(address), packets);
+    add_occurrences(daemon.occurred, &writer);
 
     add_tunnels(daemon, plane, sorting, &out);
     add_intercepts(daemon, sorting, &out);
