@@ -170,6 +170,7 @@ print_group() { # GROUP
 # Draws the rows above `mgmtctl show` with a single write, because mgmtctl, another process, draws as well.
 draw() {
     local now text row gone bar='' i cells=20 lines styles=(0 1 0 32 36 36 2)
+    [ -z "${NO_COLOR-}" ] || styles=(0 0 0 0 0 0 0)
     read_clock
     measure_terminal
     gone=$((now - step_began))

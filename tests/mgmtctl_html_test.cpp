@@ -99,7 +99,7 @@ TEST(Html, WhatComesFromOutsideIsEscaped) {
           &group.routers[0].assign, &group.routers[0].back, &group.appliances[1].address,
           &group.tables[0].routers[0]})
         *text = evil;
-    group.reasons.push_back({evil, evil, evil, evil, 4, 1, 1});
+    group.reasons.push_back({evil, evil, evil, evil, evil, 4, 1, 1});
     snapshot shown = good_snapshot({group});
     shown.alarms.push_back({1, evil, evil, evil, evil, evil, -1});
     shown.alarms_total = 1;
@@ -114,7 +114,7 @@ TEST(Html, WhatComesFromOutsideIsEscaped) {
     traffic->refused_sources = {{evil, 2}};
     traffic->accepted = {{evil + "2", evil}};
     traffic->left = {{51, evil}};
-    traffic->drains.push_back({51, evil, 3, 0});
+    traffic->drains.push_back({51, evil, 3, 0, evil});
     traffic->protection.time = 300;
     traffic->protection.groups = {{51, false, evil, 0}};
     traffic->protection.members[evil] = {};
@@ -181,7 +181,7 @@ TEST(Html, GroupsThatNeedAttentionAreOpenAndFirst) {
     EXPECT_TRUE(has(page, "<h1>Nothing needs attention</h1>"));
     EXPECT_EQ(count_of(page, "<details>"), 6u);
 
-    shown.groups[1].reasons.push_back({"password-mismatch", "10.0.0.1", "", "", 4, 70000, 3000});
+    shown.groups[1].reasons.push_back({"password-mismatch", "10.0.0.1", "", "", "", 4, 70000, 3000});
     shown.groups[3].tables[0].owners[40] = 1;
     shown.alarms.push_back(
         {196638, "adjacency", "eth0:grp:6", "raised", "2026/11/25 00:10:11", "wccpd-1", 6});

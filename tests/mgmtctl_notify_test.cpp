@@ -118,7 +118,8 @@ TEST_F(Notify, ACommandGetsTheChangeAndItsReason) {
     EXPECT_EQ(
         told({EVENT_ROLE_CHANGE, {{"group", "string", "51"}, {"role", "uint32", "1"}}}, {silent}),
         "KIND=role|GROUP=51|ALARM=|SOURCE=|STATE=BACKUP|PREVIOUS=before|REASON=router-silent|CAUSE=10.0.0.1 "
-        "has stopped answering: no I-See-You for 40 s|NEXT=check the router and the path to it|MERGED=2|");
+        "has stopped answering: no I-See-You for 40 s|NEXT=check the router, its password "
+        "for the group, and the path to it|MERGED=2|");
     EXPECT_EQ(
         told({EVENT_ROLE_CHANGE, {{"group", "string", "51"}, {"role", "uint32", "2"}}}, {absent, silent})
             .find("REASON=wccpd-absent|"),

@@ -109,7 +109,7 @@ canned one_group() {
                                           hash_rows("10.0.0.2") + hash_rows("10.0.0.1"));
     from.add(ALARM, "WCCP GRP 51: alarm: raising\033]0;evil\a adjacency down alarm");
     from.add(ALARM + "/name", "adjacency");
-    from.add(ALARM + "/since", "2026/11/25 00:10:11");
+    from.add(ALARM + "/since", "2025/11/25 00:10:11");
     return from;
 }
 
@@ -187,10 +187,10 @@ TEST(Show, TellsTheWholeOfAGroup) {
     const std::string screen = joined(draw_screen(shown, {80, 23, false, false, ""}));
     for (const char *text :
          {"wccpd Ready (1.0.0)   1 group: 1 active   1 alarm\n! group 51: 10.0.0.3 does not answer (7 "
-          "Here-I-Am "
-          "sent), since 2026/11/25 00:10:",
+          "Here-I-Am sent), since 2025/11/25\n    00:10:11\n",
           "\n  10.0.0.3 does not answer (7 Here-I-Am sent), for 0:01:10\n"
-          "  > check address, service group, password and path (UDP 2048) on the router\n",
+          "  > wait 20 s; then check address, service group, password and path (UDP 2048)\n    on "
+          "the router\n",
           "51  ACTIVE, designated !  up 1:02:03  10.0.0.101 on eth0  tcp  weight 25  md5\n",
           "  router 10.0.0.1        two-way   0:01:00  fwd gre  assign -     return l2",
           "  router 10.0.0.3        nothing heard\n",
@@ -220,7 +220,7 @@ TEST(Show, IsEmptyAndSaysSoWhereverMgmtdGoes) {
     canned from = one_group();
     from.wccpd_code = LC_IO_TIMED_OUT;
     EXPECT_EQ(from.gather().wccpd, wccpd_condition::silent);
-    EXPECT_EQ(from.asked, 10u) << "it is not asked again";
+    EXPECT_EQ(from.asked, 11u) << "it is not asked again";
     from.wccpd_code = 0;
     (void)from.gather();
     for (size_t all = from.asked, n = 0; n < all; n++) {
@@ -288,16 +288,19 @@ TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
          "    next: set the same one on both: mgmtctl group set 51 password -\n",
          1, "51  ACTIVE, designated !"},
         {"S/reason", "service-mismatch 10.0.0.1 priority 7/priority 200",
-         "10.0.0.1 has the service with priority 7; here it is priority 200"},
+         "10.0.0.1 defines the service with priority 7; here it has priority 200"},
         {"S/reason", "interface-missing 0.0.0.0 /eth9", "there is no interface eth9\n", 1,
          "51  ACTIVE, designated, no interface !"},
-        {"S/reason", "election-blocked 10.0.0.9 no I-See-You/two-way", "a router lists 10.0.0.9", 1,
-         "  no appliance can be designated: a router lists 10.0.0.9, which is here: no\n"
-         "    I-See-You, 4 times, first 0:01:10 ago, last 0:00:03 ago\n"},
+        {"S/reason", "election-blocked 10.0.0.9 no I-See-You/two-way", "the routers list 10.0.0.9", 1,
+         "  no appliance can be designated: the routers list 10.0.0.9, which is not\n"
+         "    two-way here: no I-See-You, for 0:01:10\n"},
+        {"S/reason", "router-id-zero 0.0.0.0@10.0.0.1 /", "router-id-zero: 10.0.0.1 calls itself 0.0.0.0\n"},
         {"S/reason", "query-refused 10.0.0.1 a query/", "  nothing needs attention\n  query-refused: ", 0},
-        {"S/reason", "method-differs 10.0.0.1 hash by the router/mask", "assignment is hash by the router"},
+        {"S/reason", "method-differs 10.0.0.1 hash by the router/mask",
+         "assignment is hash by the router, but mask here"},
         {"S/reason", "not-known-here 10.0.0.1 /", "  not-known-here: not-known-here of 10.0.0.1\n"},
-        {"S/oper", "BACKUP", "redirected-elsewhere: the routers redirect to others: 10.0.0.102 75%"},
+        {"S/oper", "BACKUP",
+         "redirected-elsewhere: this appliance gets nothing: the routers redirect to 10.0.0.102 75%"},
         {"S/oper", "INIT", "waiting-assignment: the routers answer; no table is in force yet (10.0.0.101 is"},
         {"C/encap", "l2", "restart-needed: the group runs with forwarding by gre, but is configured with l2"},
         {"C/admin", "down", "  nothing needs attention\n  disabled: the group is disabled\n", 0},
@@ -315,6 +318,10 @@ TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
         if (row.name == std::string("S/reason")) {
             char code[32] = "", sender[32] = "", offered[32] = "", wanted[32] = "";
             sscanf(row.value, "%31s %31s %31[^/]/%31[^\n]", code, sender, offered, wanted);
+            char *source = strchr(sender, '@');
+            from.add(root + "/3/source", source ? source + 1 : "0.0.0.0");
+            if (source)
+                *source = '\0';
             if (const char *slash = strchr(row.value, '/'); slash)
                 snprintf(wanted, sizeof wanted, "%s", slash + 1);
             const std::pair<const char *, const char *> nodes[] = {
@@ -408,7 +415,7 @@ static const char *const TRAFFIC =
     "I/52 52|I/52/proxy up|I/52/active false|I/52/in 99999|I/52/to_proxy 18446744073709551615|"
     "G/time 300|G/passed 7|G/delivered 3|G/group/51 51|G/group/51/covered true|G/group/51/slots 128|"
     "G/group/52 52|G/group/52/covered false|G/group/52/reason no bucket|G/member/10.0.0.102/passed 7|"
-    "L/51 no good check for 30 s|L/51/since 2026/11/25 00:10:11|"
+    "L/51 no good check for 30 s|L/51/since 2025/11/25 00:10:11|"
     "X/51 51|X/51/ports 80 443|X/51/to 3128|X/51/rest return|X/51/check http|X/51/check_argument /a|"
     "A/10.0.0.8 10.0.0.8|A/10.0.0.8/router 0.0.0.0|";
 

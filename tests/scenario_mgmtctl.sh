@@ -231,32 +231,57 @@ expect 0 '[[]]' --json alarms --check
 # --- explain: faults made on purpose
 
 print_explanation() { ctl --json explain "$1" || [ $? = 1 ]; }
-explains() { # GROUP CODE WORDS : within some seconds the first reason of the group has this code, and WORDS in its cause
-    lab_wait 20 "[.reasons[] | select(.group == $1 and .attention)][0] | .reason == \"$2\" and (.cause | contains(\"$3\"))" \
-        print_explanation "$1" || fail "explain $1 does not report $2: $3"
+explains() { # GROUP CODE WORDS : within some seconds the first reason of the group is CODE, with WORDS in its cause, a time and a next step
+    lab_wait 20 "[.reasons[] | select(.group == $1 and .attention)][0] | .reason == \"$2\" and .first_ms != null and
+        .next != \"\" and (.cause | contains(\"$3\"))" print_explanation "$1" || fail "explain $1 does not report $2: $3"
 }
 expect 0 '*nothing needs attention*' explain 51
-for broken in 'add 60 interface eth9 router 10.0.0.1' 'add 61 interface eth0 router 10.0.0.77' 'add 62'; do
+lab_in a1 bash -c 'ip link add eth1 type veth peer name eth4; ip link add eth2 type veth peer name eth3
+    ip address add 10.9.1.1/24 dev eth1; ip address add 10.9.3.1/24 dev eth3; ip link set eth2 up; ip link set eth3 up
+    ip route add unreachable 10.8.0.0/16'
+lab_start a1 taker wccp_router --router 10.9.3.1 # of port 2048
+while read -r group words; do
     # shellcheck disable=SC2086
-    ctl group $broken >/dev/null || fail "mgmtd refused group $broken"
-done
-explains 60 interface-missing 'no interface eth9'
-explains 61 no-answer '10.0.0.77 does not answer'
-explains 62 no-interface 'has no interface'
+    ctl group add $group $words >/dev/null || fail "mgmtd refused group $group $words"
+done <<'GROUPS'
+60 interface eth9 router 10.0.0.1
+61 interface eth0 router 10.0.0.77
+62
+63 interface eth0
+64 interface eth1 router 10.0.0.1
+65 interface eth2 router 10.0.0.1
+66 interface eth3 router 10.0.0.1
+67 interface eth0 router 10.8.0.1
+GROUPS
+while read -r group code words; do explains "$group" "$code" "$words"; done <<'CAUSES'
+60 interface-missing no interface eth9
+61 no-answer 10.0.0.77 does not answer
+62 no-interface has no interface
+63 no-router has no router
+64 interface-down eth1 is down
+65 interface-no-address eth2 has no IPv4 address
+66 port-taken 2048 on eth3 is taken
+67 send-failed sending to 10.8.0.1 fails: 
+CAUSES
+[ "$(ctl get "${S%51}67/counter/tx_send_errors")" -gt 0 ] || fail "failed sends are not counted"
+# Each fault takes precedence over the earlier ones, whose reasons last for a while.
 while read -r broken code words; do
     lab_ctl r1 fault "$broken" always >/dev/null
     explains 51 "$code" "$words"
 done <<'FAULTS'
-bad-digest password-mismatch 10.0.0.1 signs its messages with another password
-other-security security-missing 10.0.0.1 signs no message
-bad-version message-version 10.0.0.1 speaks version 0x100
+other-service service-mismatch here it has priority 200
+no-router-id router-id-zero 10.0.0.1 calls itself 0.0.0.0
 routers-33 message-malformed 33 routers
-other-service service-mismatch here it is priority 200
+bad-length message-length bytes were received
+bad-version message-version 10.0.0.1 speaks version 0x100
+bad-digest password-mismatch 10.0.0.1 signs its messages with another password
+other-security security-missing 10.0.0.1 does not sign
 FAULTS
-expect 1 '*group 51 *service-mismatch: *[0-9] ago*next: *' explain
-expect 0 '*51  * !*10.0.0.1 has the service with priority 201*' show
+expect 1 '*group 51 *security-missing: *[0-9] ago*next: *service-mismatch: *' explain
+expect 0 '*51  * !*10.0.0.1 does not sign*router 10.0.0.1 *security-missing*' show
 lab_ctl r1 fault none >/dev/null
-for broken in 60 61 62; do ctl group delete $broken >/dev/null; done
+for broken in {60..67}; do ctl group delete "$broken" >/dev/null; done
+lab_stop a1 taker
 lab_wait 20 '.attention == false' ctl --json explain 51 || fail "a reason is left"
 expect 2 '' explain 300
 

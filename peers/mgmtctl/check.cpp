@@ -65,10 +65,10 @@ constexpr const char *MAILBOX = "wccpd_mailbox", *ANY_ADDRESS = "0.0.0.0";
 struct judging {
     const check_facts &facts;
     check_result result;
-    const char *check = ""; // that is made
+    const char *check = ""; // the name of the present check
 
-    void find(const char *code, int group, const std::string &who, const std::string &offered = "",
-              const std::string &wanted = "") {
+    void add_finding(const char *code, int group, const std::string &who, const std::string &offered = "",
+                     const std::string &wanted = "") {
         reason one;
         one.code = code;
         one.group = group;
@@ -82,10 +82,10 @@ struct judging {
         if (std::none_of(result.findings.begin(), result.findings.end(), same))
             result.findings.push_back(std::move(one));
     }
-    void skip(const std::string &why) { result.unchecked.push_back({check, why}); }
+    void note_unchecked(const std::string &why) { result.unchecked.push_back({check, why}); }
 };
 
-// Calls function(group, interface) for groups that are to run on an interface that there is.
+// Calls function(group, interface) for enabled groups whose interface exists.
 template <typename Function>
 void for_groups(const check_facts &facts, const Function &function) {
     for (const check_group &group : facts.groups) {
@@ -97,7 +97,7 @@ void for_groups(const check_facts &facts, const Function &function) {
 
 bool skip_without_groups(judging *work) {
     if (!work->facts.mgmtd_error.empty())
-        work->skip("the groups are not known: " + work->facts.mgmtd_error);
+        work->note_unchecked("the groups are not known: " + work->facts.mgmtd_error);
     return !work->facts.mgmtd_error.empty();
 }
 
@@ -114,18 +114,18 @@ bool is_in_the_way(const check_facts &facts, const check_socket &socket) {
 void judge_port(judging *work) {
     const check_facts &facts = work->facts;
     if (!facts.ports_error.empty())
-        return work->skip(facts.ports_error);
+        return work->note_unchecked(facts.ports_error);
     for (const check_socket &socket : facts.sockets) {
         if (socket.program == "wccpd" || !is_in_the_way(facts, socket))
             continue;
         if (socket.program.empty() && facts.wccpd_runs)
-            work->skip("only root sees whether it is wccpd who has the port on " + socket.address);
+            work->note_unchecked("only root sees whether it is wccpd who has the port on " + socket.address);
         else
-            work->find("port-taken", -1, "",
-                       socket.program.empty()
-                           ? "by a program that only root sees"
-                           : socket.program + " (process " + std::to_string(socket.process) + ")",
-                       socket.address);
+            work->add_finding("port-taken", -1, "",
+                              socket.program.empty()
+                                  ? "by a program that only root sees"
+                                  : socket.program + " (process " + std::to_string(socket.process) + ")",
+                              socket.address);
     }
 }
 
@@ -137,13 +137,13 @@ void judge_interfaces(judging *work) {
             continue;
         const auto found = work->facts.interfaces.find(group.interface);
         if (group.interface.empty())
-            work->find("no-interface", group.id, "");
+            work->add_finding("no-interface", group.id, "");
         else if (found == work->facts.interfaces.end())
-            work->find("interface-missing", group.id, "", "", group.interface);
+            work->add_finding("interface-missing", group.id, "", "", group.interface);
         else if (!found->second.up)
-            work->find("interface-down", group.id, "", "", group.interface);
+            work->add_finding("interface-down", group.id, "", "", group.interface);
         else if (found->second.addresses.empty())
-            work->find("interface-no-address", group.id, "", "", group.interface);
+            work->add_finding("interface-no-address", group.id, "", "", group.interface);
     }
 }
 
@@ -152,8 +152,9 @@ bool is_own_link(const std::string &name) {
            std::all_of(name.begin() + 4, name.end(), [](char c) { return c >= '0' && c <= '9'; });
 }
 
-// Calls function(group or -1, name, interface) for those that redirected packets come in by: tunnels, and
-// interfaces of groups that routers may reach by L2 alone. What else is wanted of them, tunneld sees to.
+// Calls function(group or -1, name, interface) for the interfaces on which redirected packets arrive:
+// tunnels, and interfaces of groups with L2 only. For other groups tunneld changes the settings itself when
+// needed.
 template <typename Function>
 void for_redirected(const check_facts &facts, const Function &function) {
     for (const auto &[name, interface] : facts.interfaces)
@@ -166,13 +167,13 @@ void for_redirected(const check_facts &facts, const Function &function) {
 }
 
 void judge_rp_filter(judging *work) {
-    (void)skip_without_groups(work); // tunnels are looked at all the same
+    (void)skip_without_groups(work); // tunnels are checked in any case
     for_redirected(work->facts, [&](int group, const std::string &name, const check_interface &interface) {
         if (!work->facts.all_rp_filter || !interface.rp_filter)
-            return work->skip("the setting of " + name + " cannot be read");
-        // The larger one counts: 2, which is loose, over 1.
+            return work->note_unchecked("the setting of " + name + " cannot be read");
+        // The kernel uses the larger value: 2, which is loose, wins over 1.
         if (std::max(*work->facts.all_rp_filter, *interface.rp_filter) == STRICT)
-            work->find("rp-filter", group, name);
+            work->add_finding("rp-filter", group, name);
     });
 }
 
@@ -180,9 +181,9 @@ void judge_forwarding(judging *work) {
     (void)skip_without_groups(work);
     for_redirected(work->facts, [&](int group, const std::string &name, const check_interface &interface) {
         if (!interface.forwarding)
-            work->skip("the setting of " + name + " cannot be read");
+            work->note_unchecked("the setting of " + name + " cannot be read");
         else if (*interface.forwarding == 0)
-            work->find(group < 0 ? "forwarding-off" : "forwarding-later", group, name);
+            work->add_finding(group < 0 ? "forwarding-off" : "forwarding-later", group, name);
     });
 }
 
@@ -195,26 +196,27 @@ void judge_packets(judging *work, const nlohmann::json &rules, const check_group
             const std::string name = group.interface.empty() ? "any interface" : group.interface;
             const char *way = outgoing ? "out of" : "in by";
             if (found.result == filter_result::drops)
-                work->find(gre ? "firewall-drops-gre" : "firewall-drops-wccp", group.id, name, way,
-                           found.chain);
+                work->add_finding(gre ? "firewall-drops-gre" : "firewall-drops-wccp", group.id, name, way,
+                                  found.chain);
             else if (found.result == filter_result::unclear)
-                work->find("firewall-unclear", group.id, name,
-                           std::string(gre ? "protocol 47 (GRE) " : "UDP port 2048 ") + way, found.chain);
+                work->add_finding("firewall-unclear", group.id, name,
+                                  std::string(gre ? "protocol 47 (GRE) " : "UDP port 2048 ") + way,
+                                  found.chain);
         }
 }
 
 void judge_firewall(judging *work) {
     const check_facts &facts = work->facts;
     if (!facts.legacy_error.empty())
-        work->skip("the tables of iptables cannot be read: " + facts.legacy_error);
+        work->note_unchecked("the tables of iptables cannot be read: " + facts.legacy_error);
     else if (!facts.legacy_tables.empty())
-        work->skip("iptables has tables of its own (" + facts.legacy_tables +
-                   "), which this cannot read: look through iptables-legacy-save");
+        work->note_unchecked("iptables has tables of its own (" + facts.legacy_tables +
+                             "), which this cannot read: look through iptables-legacy-save");
     if (!facts.filter_error.empty())
-        return work->skip("the rules cannot be read: " + facts.filter_error);
+        return work->note_unchecked("the rules cannot be read: " + facts.filter_error);
     const nlohmann::json listing = nlohmann::json::parse(facts.filter_listing, nullptr, false);
     if (!listing.is_object() || !listing.contains("nftables") || !listing["nftables"].is_array())
-        return work->skip("the rules cannot be read: their listing is not understood");
+        return work->note_unchecked("the rules cannot be read: their listing is not understood");
     const nlohmann::json &rules = listing["nftables"];
     if (!facts.mgmtd_error.empty())
         return judge_packets(work, rules, {-1, "", true, "either"});
@@ -228,8 +230,8 @@ void judge_mtu(judging *work) {
         return;
     for_groups(work->facts, [&](const check_group &group, const check_interface &interface) {
         if (interface.mtu > 0 && interface.mtu < MTU_WANTED)
-            work->find("mtu-small", group.id, group.interface, std::to_string(interface.mtu),
-                       std::to_string(MTU_WANTED));
+            work->add_finding("mtu-small", group.id, group.interface, std::to_string(interface.mtu),
+                              std::to_string(MTU_WANTED));
     });
 }
 
@@ -239,52 +241,53 @@ void judge_kernel(judging *work) {
         {"GRE", facts.gre}, {"TUN", facts.tun}, {"TPROXY", facts.tproxy}};
     for (const auto &[name, feature] : features)
         if (feature == check_feature::unknown)
-            work->skip(std::string("neither the kernel nor its modules say whether it has ") + name);
+            work->note_unchecked(std::string("neither the kernel nor its modules say whether it has ") +
+                                 name);
     if (facts.gre == check_feature::missing && facts.tun != check_feature::unknown)
-        work->find(facts.tun == check_feature::missing ? "gre-missing" : "gre-by-tun", -1, "");
+        work->add_finding(facts.tun == check_feature::missing ? "gre-missing" : "gre-by-tun", -1, "");
     else if (facts.tun == check_feature::missing)
-        work->find("tun-missing", -1, "");
+        work->add_finding("tun-missing", -1, "");
     if (facts.tproxy == check_feature::missing)
-        work->find("tproxy-missing", -1, "");
+        work->add_finding("tproxy-missing", -1, "");
 }
 
 void judge_clock(judging *work) {
     if (!work->facts.clock_synchronised)
-        work->skip("the kernel does not say");
+        work->note_unchecked("the kernel does not say");
     else if (!*work->facts.clock_synchronised)
-        work->find("clock-unsynchronised", -1, "");
+        work->add_finding("clock-unsynchronised", -1, "");
 }
 
 void judge_memory(judging *work) {
     const check_facts &facts = work->facts;
     if (!facts.wccpd_runs)
-        work->skip("wccpd is not running: its limit is the one of its unit");
+        work->note_unchecked("wccpd is not running: its limit is the one of its unit");
     else if (!facts.lock_limit_error.empty())
-        work->skip(facts.lock_limit_error);
+        work->note_unchecked(facts.lock_limit_error);
     else if (!facts.may_lock && facts.lock_limit_bytes)
-        work->find("memory-lock", -1, "", std::to_string(*facts.lock_limit_bytes / 1024) + " KiB");
+        work->add_finding("memory-lock", -1, "", std::to_string(*facts.lock_limit_bytes / 1024) + " KiB");
 }
 
-// False when there is nothing more to be said of the file.
+// False when the file could not be read.
 bool judge_file(judging *work, const check_file &file, const char *path, const char *unreadable,
                 const char *line) {
     if (file.error == EACCES && !work->facts.root)
-        work->skip(std::string(path) + ": " + strerror(file.error));
+        work->note_unchecked(std::string(path) + ": " + strerror(file.error));
     else if (file.error)
-        work->find(unreadable, -1, path, strerror(file.error));
+        work->add_finding(unreadable, -1, path, strerror(file.error));
     else if (file.bad_line)
-        work->find(line, -1, path, std::to_string(file.bad_line));
+        work->add_finding(line, -1, path, std::to_string(file.bad_line));
     return file.error == 0;
 }
 
 void judge_mem_conf(judging *work) {
     const check_file &file = work->facts.mem_conf;
     if (judge_file(work, file, CMEM_CONF_PATH, "mem-conf-unreadable", "mem-conf-line") && !file.complete)
-        work->find("mem-conf-mailbox", -1, CMEM_CONF_PATH, "", MAILBOX);
+        work->add_finding("mem-conf-mailbox", -1, CMEM_CONF_PATH, "", MAILBOX);
 }
 
 void judge_platform_conf(judging *work) {
-    if (work->facts.platform_conf.error != ENOENT) // then the defaults hold
+    if (work->facts.platform_conf.error != ENOENT) // without a file the defaults are used
         (void)judge_file(work, work->facts.platform_conf, PLATFORM_CONF_PATH, "platform-conf-unreadable",
                          "platform-conf-line");
 }
@@ -341,7 +344,7 @@ int tell_checks(const ctl_options &options, const check_result &result) {
     for (const reason &each : result.findings)
         put(each.code + (each.group < 0 ? "" : " (group " + std::to_string(each.group) + ")") + ": " +
             each.cause + "\n    " + (each.attention ? "fix: " : "no fault: ") + each.next + "\n");
-    std::map<std::string, std::string> unchecked; // the checks, by why
+    std::map<std::string, std::string> unchecked; // the names of the checks, by the reason
     for (const auto &each : result.unchecked)
         unchecked[each.why] += (unchecked[each.why].empty() ? "" : ", ") + each.check;
     for (const auto &[why, names] : unchecked)

@@ -1,5 +1,5 @@
-// What bites on Linux, and how to mend it: facts about the host are gathered first, then judged. Nothing is
-// changed, and no program is needed: what could not be looked at is said.
+// Settings of the host that keep a group from working, and how to fix them: facts about the host are gathered
+// first, then judged. Nothing is changed, and no daemon has to run; checks that cannot be made are listed.
 #pragma once
 
 #include <map>
@@ -24,9 +24,9 @@ struct check_interface {
     long mtu = 0;
     std::optional<long> rp_filter, forwarding; // its own; empty: cannot be read
 };
-// Who has UDP port 2048. Both are empty, and 0, where only root may know.
+// A socket on UDP port 2048. Program and process are empty, and 0, where only root may see them.
 struct check_socket {
-    std::string address; // 0.0.0.0 also for one of IPv6
+    std::string address; // 0.0.0.0 for a socket of IPv6 as well
     std::string program;
     int process = 0;
 };
@@ -35,12 +35,12 @@ enum class check_feature { missing, present, unknown };
 struct check_file {
     int error = 0;         // errno of reading it
     uint32_t bad_line = 0; // the first one; 0: none
-    bool complete = true;  // has what wccpd needs of it
+    bool complete = true;  // it has all that wccpd needs
 };
 struct check_facts {
     std::string mgmtd_error; // why the groups are not known; empty: they are
     std::vector<check_group> groups;
-    std::map<std::string, check_interface> interfaces; // all that there are
+    std::map<std::string, check_interface> interfaces; // of the host, by name
     std::optional<long> all_rp_filter;
     std::string ports_error;
     std::vector<check_socket> sockets;
@@ -54,7 +54,7 @@ struct check_facts {
     std::optional<uint64_t> lock_limit_bytes; // of wccpd; empty: none
     bool may_lock = false;                    // CAP_IPC_LOCK
     check_file mem_conf, platform_conf;
-    bool root = true; // who looks
+    bool root = true; // this process runs as root
 };
 
 struct check_result {
@@ -66,10 +66,10 @@ struct check_result {
     std::vector<std::string> fine; // checks with neither
 };
 check_result judge_facts(const check_facts &facts);
-// The words of findings; those of a code that wccpd has as well are in the table of reasons.h.
+// The words of findings. Codes that wccpd has as well are in the table of reasons.h.
 const std::vector<reason_text> &check_texts();
 
-// Looks at the host (check_facts.cpp), and asks for the groups.
+// Looks at the host (check_facts.cpp), and asks mgmtd for the groups.
 check_facts gather_facts(const ctl_link &link);
-// 0: nothing to fix, 1: something.
+// Prints the result. 0: nothing to fix, 1: something.
 int tell_checks(const ctl_options &options, const check_result &result);

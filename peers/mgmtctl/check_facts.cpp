@@ -1,4 +1,4 @@
-// What "mgmtctl check" looks at. Everything is only read; what cannot be read is noted.
+// The facts that "mgmtctl check" looks at. Everything is only read; what cannot be read is noted.
 #include <arpa/inet.h>
 #include <dirent.h>
 #include <ifaddrs.h>
@@ -27,7 +27,6 @@
 #include "runtime/cmem.h"
 
 namespace {
-
 constexpr unsigned WCCP_UDP_PORT = 2048;
 
 std::optional<std::string> first_line(const std::string &path) {
@@ -80,7 +79,7 @@ void gather_interfaces(check_facts *out) {
     const std::string settings = "/proc/sys/net/ipv4/conf/";
     for (const ifaddrs *one = all; one; one = one->ifa_next) {
         std::string name = one->ifa_name;
-        name.resize(std::min(name.size(), name.find(':'))); // a label
+        name.resize(std::min(name.size(), name.find(':'))); // an alias such as eth0:1
         check_interface &interface = out->interfaces[name];
         interface.up = (one->ifa_flags & IFF_UP) && (one->ifa_flags & IFF_RUNNING);
         interface.rp_filter = number_in(settings + name + "/rp_filter");
@@ -103,7 +102,7 @@ void gather_interfaces(check_facts *out) {
 
 // --- Processes and sockets
 
-// Calls function(process id, its directory) until it gives false.
+// Calls function(process id, its directory) until it returns false.
 template <typename Function>
 void for_processes(const Function &function) {
     for (const std::string &name : names_in("/proc")) {
@@ -113,7 +112,7 @@ void for_processes(const Function &function) {
     }
 }
 
-// The address as /proc has it: words of 32 bits in the order of the host. Empty: none that IPv4 can meet.
+// An address in /proc: words of 32 bits in host order. Empty: an IPv6 address that receives no IPv4.
 std::string address_of(const std::string &text) {
     static const std::string mapped = "0000000000000000FFFF0000", any = std::string(32, '0');
     if (text == any)
@@ -130,7 +129,7 @@ std::string address_of(const std::string &text) {
 void read_sockets(const char *path, std::map<std::string, check_socket> *inout) {
     std::ifstream in(path);
     std::string line;
-    std::getline(in, line); // the heading
+    std::getline(in, line); // the column titles
     while (std::getline(in, line)) {
         std::istringstream words(line);
         std::string slot, local, skipped, inode;
@@ -171,7 +170,7 @@ void gather_sockets(check_facts *out) {
         out->sockets.push_back(socket);
 }
 
-// Of the wccpd of this network namespace, where that can be told.
+// The limits of the wccpd in this network namespace, where that can be determined.
 void gather_wccpd(check_facts *out) {
     const std::string network = link_text("/proc/self/ns/net");
     for_processes([&](int, const std::string &directory) {
@@ -191,7 +190,7 @@ void gather_wccpd(check_facts *out) {
             known = true;
             std::istringstream rest(line.substr(heading.size()));
             uint64_t bytes = 0;
-            if (rest >> bytes) // no number is no limit
+            if (rest >> bytes) // "unlimited" is not a number
                 out->lock_limit_bytes = bytes;
         }
         if (!known)
@@ -203,7 +202,7 @@ void gather_wccpd(check_facts *out) {
 // --- The packet filter
 
 void gather_filter(check_facts *out) {
-    const bool may = lc_has_capability(CAP_NET_ADMIN); // without it the library complains on standard error
+    const bool may = lc_has_capability(CAP_NET_ADMIN); // without it the library prints to standard error
     nft_ctx *context = may ? nft_ctx_new(NFT_CTX_DEFAULT) : nullptr;
     if (!may)
         out->filter_error = "it takes root, or CAP_NET_ADMIN";
@@ -229,7 +228,7 @@ void gather_filter(check_facts *out) {
 
 // --- The kernel
 
-// Functions of the kernel, built in or of modules that are loaded, and modules that could be.
+// Functions of the kernel, whether built in or in loaded modules, and modules that can be loaded.
 void gather_kernel(check_facts *out) {
     struct {
         const char *function, *module;
@@ -275,7 +274,7 @@ void gather_files(check_facts *out) {
     const cmem_conf_faults memory = cmem_check_conf(CMEM_CONF_PATH, "wccpd_mailbox");
     out->mem_conf = {memory.error, memory.bad_line, memory.has_key};
     std::ifstream in(PLATFORM_CONF_PATH);
-    if (!in || (in.peek() == EOF && in.bad())) { // the second is a directory
+    if (!in || (in.peek() == EOF && in.bad())) { // the second case is a directory
         out->platform_conf.error = errno;
         return;
     }

@@ -14,10 +14,10 @@ constexpr int DEPTH_MAX = 16; // of jumps, as in the kernel
 constexpr const char *OWN_TABLE = "tunneld";
 
 enum class answer { no, maybe, yes };
-answer both(answer a, answer b) {
+answer all_hold(answer a, answer b) {
     return std::min(a, b);
 }
-answer negated(answer a) {
+answer negate_answer(answer a) {
     return a == answer::maybe ? a : a == answer::yes ? answer::no : answer::yes;
 }
 answer answer_of(bool holds) {
@@ -41,7 +41,7 @@ struct walker {
     std::map<std::string, rules_of_chain> chains; // by "FAMILY TABLE CHAIN"
     std::map<std::string, json> sets;             // elements by "FAMILY TABLE SET"
     std::string table;                            // "FAMILY TABLE " of the chain that is walked
-    bool may_accept = false, may_drop = false;    // a rule whose condition is not clear
+    bool may_accept = false, may_drop = false;    // by a rule whose condition is not clear
 
     answer is_value(const json &value, const std::string &own) const;
     answer is_number(const json &value, int own) const;
@@ -75,11 +75,11 @@ answer walker::is_number(const json &value, int own) const {
         return answer_of(value["range"][0].get<int64_t>() <= own && own <= value["range"][1].get<int64_t>());
     if (value.is_string() && (value == "udp" || value == "gre"))
         return answer_of(own == (value == "udp" ? UDP_NUMBER : GRE_NUMBER));
-    // A name of another protocol, which stays unclear where it may be one of a port.
+    // The name of another protocol; it may also be the name of a port, which stays unclear.
     return value.is_string() && (own == UDP_NUMBER || own == GRE_NUMBER) ? answer::no : answer::maybe;
 }
 
-// Whether a value, or one of a set's, is ours.
+// Whether the packet has this value, or one of a set.
 template <typename Compare>
 answer walker::is_any(const json &right, const Compare &compare) const {
     const json *list = &right;
@@ -147,12 +147,12 @@ answer walker::matches(const json &match) const {
     const answer equal = holds(match["left"], match["right"]);
     if (op == "==" || op == "in")
         return equal;
-    // A packet without the field matches neither way.
+    // A packet without the field matches neither "==" nor "!=".
     const json &left = match["left"];
     const std::string of = left.contains("payload") ? text_at(left["payload"], "protocol") : "";
     if (!of.empty() && of != "ip" && of != "th" && (of != "udp" || packet.gre))
         return equal;
-    return op == "!=" ? negated(equal) : answer::maybe;
+    return op == "!=" ? negate_answer(equal) : answer::maybe;
 }
 
 fate walker::apply(const std::string &verdict, const json &body, answer condition, int depth) {
@@ -168,7 +168,7 @@ fate walker::apply(const std::string &verdict, const json &body, answer conditio
         if (result == fate::returned || (result == fate::goes_on && verdict == "goto"))
             result = verdict == "goto" ? fate::returned : fate::goes_on;
     } else if (verdict != "continue")
-        result = fate::accepted; // or changed, or for a program to decide
+        result = fate::accepted; // or changed, or passed to a program
     if (condition == answer::yes && verdict != "queue")
         return result;
     may_accept = may_accept || result == fate::accepted || result == fate::returned;
@@ -182,8 +182,8 @@ fate walker::end_unclear(answer condition) {
     return fate::goes_on;
 }
 
-// Of iptables-nft. Older libraries give no name: what ends a rule then may be a target, and anything else a
-// match.
+// A statement of iptables-nft. Older libraries give no name: the last statement of a rule may then be a
+// target, the others are matches.
 fate walker::apply_extension(const json &body, bool last, answer *inout_condition) {
     const std::string name = text_at(body, "name"), type = text_at(body, "type");
     for (const char *harmless : {"LOG", "NFLOG", "MARK", "CONNMARK", "CT", "TCPMSS", "CHECKSUM", "CLASSIFY"})
@@ -193,7 +193,7 @@ fate walker::apply_extension(const json &body, bool last, answer *inout_conditio
         return apply("reject", json(), *inout_condition, 0);
     if (type == "target" || (type.empty() && last))
         return end_unclear(*inout_condition);
-    *inout_condition = both(*inout_condition, answer::maybe);
+    *inout_condition = all_hold(*inout_condition, answer::maybe);
     return fate::goes_on;
 }
 
@@ -210,7 +210,7 @@ fate walker::walk_rule(const json &rule, int depth) {
             return std::find(kinds.begin(), kinds.end(), kind) != kinds.end();
         };
         if (kind == "match")
-            condition = both(condition, matches(body));
+            condition = all_hold(condition, matches(body));
         else if (is_one_of({"accept", "drop", "reject", "return", "continue", "queue", "jump", "goto", "snat",
                             "dnat", "masquerade", "redirect"})) {
             const fate result = apply(kind, body, condition, depth);
@@ -226,7 +226,7 @@ fate walker::walk_rule(const json &rule, int depth) {
                 if (!pair.is_array() || pair.size() != 2 || !pair[1].is_object() || pair[1].empty())
                     continue;
                 const fate result = apply(pair[1].begin().key(), pair[1].begin().value(),
-                                          both(condition, holds(body["key"], pair[0])), depth);
+                                          all_hold(condition, holds(body["key"], pair[0])), depth);
                 if (result != fate::goes_on)
                     return result;
             }
@@ -235,7 +235,7 @@ fate walker::walk_rule(const json &rule, int depth) {
             if (result != fate::goes_on)
                 return result;
         } else if (!is_one_of({"counter", "log", "notrack", "mangle", "flow", "ct helper", "comment"}))
-            condition = both(condition, answer::maybe); // limits, and what is not understood
+            condition = all_hold(condition, answer::maybe); // a limit, or something that is not understood
     }
     return fate::goes_on;
 }

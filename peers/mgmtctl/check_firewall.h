@@ -9,14 +9,14 @@
 struct filtered_packet {
     bool gre = false;
     bool outgoing = false;
-    std::string interface; // empty: any, what depends on it is unclear
+    std::string interface; // empty: any; a condition on it is unclear then
 };
 enum class filter_result { passes, unclear, drops };
 struct filter_finding {
     filter_result result = filter_result::passes;
     std::string chain; // "inet filter input", that decides; empty when the packet passes
 };
-// `objects`: what is in "nftables" of "nft --json list ruleset". A rule with a condition that is not
-// understood, or that depends on more than the packet above, makes the result unclear where it matters.
-// tunneld's own table is left out.
+// `objects`: the array "nftables" of "nft --json list ruleset". A condition that is not understood, or that
+// depends on more than the packet above, makes the result unclear if it could change the verdict. tunneld's
+// own table is left out.
 filter_finding judge_packet(const nlohmann::json &objects, const filtered_packet &packet);

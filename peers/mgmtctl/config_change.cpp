@@ -1,8 +1,8 @@
-// A difference is one of what holds, not of what was set: a file that sets a default and one that leaves it
-// out are the same configuration. Only what differs is sent, and a group that is in both is never deleted and
-// created again for it.
+// Configurations are compared by the values in force, not by what was set: a file that sets a default and one
+// that leaves it out are the same configuration. Only differences are sent. A group that is in both is
+// changed and never deleted and created again.
 //
-// A password that is hidden, as it is in an export without --secrets, stands for the one that there is.
+// A hidden password, as in an export without --secrets, stands for the present one.
 #include "peers/mgmtctl/config_change.h"
 
 #include <set>
@@ -11,14 +11,15 @@
 
 #include "peers/nodes/secrets.h"
 
-static ctl_binding shown_binding(const node_name &name, const node_value &value) {
+namespace {
+ctl_binding shown_binding(const node_name &name, const node_value &value) {
     return {name.text(), type_name(value.type), value.text};
 }
 
 // --- Reading
 
-// Names that are given twice are kept by the parser once.
-static bool parse_json(const std::string &content, ctl_json *out, std::string *out_reason) {
+// The parser keeps one of two equal names; the callback detects them.
+bool parse_json(const std::string &content, ctl_json *out, std::string *out_reason) {
     std::set<std::string> names;
     std::string twice;
     const auto look = [&](int depth, ctl_json::parse_event_t event, ctl_json &parsed) {
@@ -35,8 +36,8 @@ static bool parse_json(const std::string &content, ctl_json *out, std::string *o
     return out_reason->empty();
 }
 
-static bool take_json_node(node_tree *tree, const std::string &text, const ctl_json &value,
-                           std::string *out_reason) {
+bool take_json_node(node_tree *tree, const std::string &text, const ctl_json &value,
+                    std::string *out_reason) {
     node_name name;
     const schema_row *row = parse_node_name(text, &name) ? find_schema_row(name) : nullptr;
     if (!row) {
@@ -58,8 +59,7 @@ static bool take_json_node(node_tree *tree, const std::string &text, const ctl_j
     return false;
 }
 
-static bool read_json(const std::string &content, const std::string &file, node_tree *out,
-                      std::string *out_errors) {
+bool read_json(const std::string &content, const std::string &file, node_tree *out, std::string *out_errors) {
     ctl_json nodes;
     std::string reason;
     if (!parse_json(content, &nodes, &reason)) {
@@ -72,7 +72,7 @@ static bool read_json(const std::string &content, const std::string &file, node_
     return out_errors->empty();
 }
 
-static bool keep_hidden(node_tree *tree, const node_tree &present, std::string *out_reason) {
+bool keep_hidden(node_tree *tree, const node_tree &present, std::string *out_reason) {
     for (auto &[name, text] : tree->set) {
         if (!is_secret(name) || text != HIDDEN)
             continue;
@@ -87,6 +87,7 @@ static bool keep_hidden(node_tree *tree, const node_tree &present, std::string *
     }
     return true;
 }
+} // namespace
 
 bool read_config(const std::string &content, const std::string &file, const node_tree &present, bool merge,
                  node_tree *out, std::string *out_errors) {
@@ -126,7 +127,7 @@ std::vector<node_change> config_changes(const node_tree &before, const node_tree
 
 std::vector<ctl_change_item> items_of(const std::vector<node_change> &changes, const node_tree &after) {
     std::vector<ctl_change_item> out;
-    node_name gone; // the last group, or other instance, that is deleted whole
+    node_name gone; // the last group, or other instance, that is deleted as a whole
     for (const node_change &change : changes) {
         const std::string name = change.name.text();
         if (change.after && after.set.contains(change.name)) {
@@ -153,9 +154,11 @@ change_notes config_notes(const std::vector<ctl_change_item> &items, const node_
     return notes_of(items, known);
 }
 
-static const char *kind_of(const node_change &change) {
+namespace {
+const char *kind_of(const node_change &change) {
     return !change.before ? "add" : !change.after ? "delete" : "modify";
 }
+} // namespace
 
 std::string text_change(const node_change &change, bool secrets) {
     std::string out = std::string(kind_of(change)) + (change.before ? " " : "    ") + change.name.text();

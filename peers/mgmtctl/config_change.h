@@ -1,4 +1,5 @@
-// Whole configurations: read from what somebody wrote, compared, and turned into the items of one commit.
+// Whole configurations: read from a file that a person wrote, compared, and turned into the items of one
+// commit.
 #pragma once
 
 #include <string>
@@ -8,14 +9,14 @@
 #include "peers/mgmtctl/render.h"
 #include "peers/nodes/config_text.h"
 
-// A configuration in mgmtd's format or as JSON, an object of values by the names of their nodes. Passwords
-// that are hidden in it are those of `present`. With `merge` it is laid over `present`. False with
-// complaints, a line for each.
+// A configuration in mgmtd's format, or as a JSON object of values by the names of their nodes. A hidden
+// password stands for the one in `present`. With `merge`, nodes that it does not name keep their values of
+// `present`. False with the errors, one in a line.
 bool read_config(const std::string &content, const std::string &file, const node_tree &present, bool merge,
                  node_tree *out, std::string *out_errors);
 
-// What there is to be seen of a change from one to the other: defaults that come and go with a group are
-// left out.
+// The changes from one to the other that an operator wants to see: without the defaults of a group that is
+// added or deleted.
 std::vector<node_change> config_changes(const node_tree &before, const node_tree &after);
 std::vector<ctl_change_item> items_of(const std::vector<node_change> &changes, const node_tree &after);
 // What wccpd makes of it.

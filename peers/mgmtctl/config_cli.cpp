@@ -1,8 +1,8 @@
-// The words about the configuration as a whole: "apply", "confirm", "export", "history", "diff", "rollback".
+// The commands about the configuration as a whole: "apply", "confirm", "export", "history", "diff",
+// "rollback".
 //
-// mgmtd gives a configuration as the text of its file, with the revision that it is of. What is to become of
-// it is worked out here, and asked for with that revision: when somebody else commits in between, mgmtd
-// refuses.
+// mgmtd answers with the text of its configuration file and the revision of that text. The changes are
+// computed here, and requested for that revision: when somebody else commits in between, mgmtd refuses.
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
@@ -17,12 +17,13 @@
 #include "peers/mgmtctl/config_change.h"
 #include "peers/mgmtctl/connection.h"
 
-static constexpr size_t FILE_MAX_BYTES = 16u << 20;
+namespace {
+constexpr size_t FILE_MAX_BYTES = 16u << 20;
 
-// --- What mgmtd has
+// --- Configurations of mgmtd
 
 // False when the failure has been printed, and its exit code is in `mgmtd->code`.
-static bool get_text(connection *mgmtd, const std::string &name, const std::string &missing, ctl_reply *out) {
+bool get_text(connection *mgmtd, const std::string &name, const std::string &missing, ctl_reply *out) {
     if (!mgmtd->session)
         return false;
     if (!mgmtd->ask(ctl_walk::node, name, out))
@@ -36,8 +37,8 @@ static bool get_text(connection *mgmtd, const std::string &name, const std::stri
     return false;
 }
 
-static bool get_config(connection *mgmtd, const std::string &name, const std::string &missing,
-                       config_text *out, uint32_t *out_revision) {
+bool get_config(connection *mgmtd, const std::string &name, const std::string &missing, config_text *out,
+                uint32_t *out_revision) {
     ctl_reply reply;
     if (!get_text(mgmtd, name, missing, &reply))
         return false;
@@ -49,11 +50,11 @@ static bool get_config(connection *mgmtd, const std::string &name, const std::st
     return false;
 }
 
-static bool get_present(connection *mgmtd, config_text *out, uint32_t *out_revision) {
+bool get_present(connection *mgmtd, config_text *out, uint32_t *out_revision) {
     return get_config(mgmtd, NODE_CONFIG_TEXT, "mgmtd is too old for this", out, out_revision);
 }
 
-static bool get_commit(connection *mgmtd, uint32_t number, config_text *out) {
+bool get_commit(connection *mgmtd, uint32_t number, config_text *out) {
     uint32_t ignored = 0;
     return get_config(mgmtd, NODE_COMMITS "/" + std::to_string(number) + "/text",
                       "commit " + std::to_string(number) + " is not kept; \"mgmtctl history\" lists what is",
@@ -62,16 +63,14 @@ static bool get_commit(connection *mgmtd, uint32_t number, config_text *out) {
 
 // --- Commits
 
-namespace {
-// What is to be done, and has been done.
+// The changes of one commit.
 struct plan {
     std::vector<node_change> changes;
     std::vector<ctl_change_item> items;
     change_notes notes;
 };
-} // namespace
 
-static plan make_plan(const node_tree &before, const node_tree &after) {
+plan make_plan(const node_tree &before, const node_tree &after) {
     plan out;
     out.changes = config_changes(before, after);
     out.items = items_of(out.changes, after);
@@ -79,20 +78,20 @@ static plan make_plan(const node_tree &before, const node_tree &after) {
     return out;
 }
 
-static ctl_json json_changes(const std::vector<node_change> &changes, bool secrets) {
+ctl_json json_changes(const std::vector<node_change> &changes, bool secrets) {
     ctl_json out = ctl_json::array();
     for (const node_change &change : changes)
         out.push_back(json_change(change, secrets));
     return out;
 }
 
-static void put_changes(const ctl_options &options, const std::vector<node_change> &changes) {
+void put_changes(const ctl_options &options, const std::vector<node_change> &changes) {
     for (const node_change &change : changes)
         put(text_change(change, options.secrets) + "\n");
 }
 
-// For a person, before it is done or after.
-static void put_plan(const ctl_options &options, const plan &made) {
+// Prints the changes for a person.
+void put_plan(const ctl_options &options, const plan &made) {
     if (options.json)
         return;
     put_changes(options, made.changes);
@@ -101,8 +100,8 @@ static void put_plan(const ctl_options &options, const plan &made) {
         fprintf(stderr, "mgmtctl: note: %s\n", note.c_str());
 }
 
-static int tell_plan(const ctl_options &options, const plan &made, uint32_t commit, bool done,
-                     uint32_t confirm_minutes, int code) {
+int tell_plan(const ctl_options &options, const plan &made, uint32_t commit, bool done,
+              uint32_t confirm_minutes, int code) {
     const bool waits = done && confirm_minutes != 0;
     if (options.json) {
         put(json_line({{"changes", json_changes(made.changes, options.secrets)},
@@ -124,7 +123,7 @@ static int tell_plan(const ctl_options &options, const plan &made, uint32_t comm
 }
 
 // Sends the items. False when the failure has been printed, and its exit code is in `mgmtd->code`.
-static bool send_plan(connection *mgmtd, const plan &made, const ctl_order &order, ctl_reply *out) {
+bool send_plan(connection *mgmtd, const plan &made, const ctl_order &order, ctl_reply *out) {
     if (!ctl_set(mgmtd->session.get(), made.items, order, out, &mgmtd->reason)) {
         mgmtd->code = mgmtd->lost();
         return false;
@@ -136,7 +135,7 @@ static bool send_plan(connection *mgmtd, const plan &made, const ctl_order &orde
 
 // --- apply
 
-static bool read_file(const std::string &file, std::string *out, std::string *out_reason) {
+bool read_file(const std::string &file, std::string *out, std::string *out_reason) {
     const int fd = file == "-" ? STDIN_FILENO : open(file.c_str(), O_RDONLY | O_CLOEXEC);
     char bytes[65536];
     ssize_t got = fd < 0 ? -1 : 1;
@@ -156,19 +155,19 @@ static bool read_file(const std::string &file, std::string *out, std::string *ou
     return out_reason->empty();
 }
 
-static bool ask_person() {
+bool ask_person() {
     char line[64] = "";
     fputs("mgmtctl: apply this? [y/N] ", stderr);
-    const ssize_t got = read(STDIN_FILENO, line, sizeof line - 1); // a signal ends it
+    const ssize_t got = read(STDIN_FILENO, line, sizeof line - 1); // ended by a signal as well
     return got > 0 && (line[0] == 'y' || line[0] == 'Y');
 }
 
-// A failure of --check has a code of its own, apart from that of a difference.
-static int apply_code(const ctl_apply_options &how, int code) {
+// With --check a failure and a difference have different codes.
+int apply_code(const ctl_apply_options &how, int code) {
     return how.check && code != CTL_OK ? int{CTL_USAGE} : code;
 }
 
-static int apply_plan(connection *mgmtd, const plan &made, const ctl_apply_options &how, uint32_t revision) {
+int apply_plan(connection *mgmtd, const plan &made, const ctl_apply_options &how, uint32_t revision) {
     const ctl_options &options = mgmtd->options;
     ctl_reply reply;
     if (made.changes.empty())
@@ -181,6 +180,7 @@ static int apply_plan(connection *mgmtd, const plan &made, const ctl_apply_optio
     return tell_plan(options, made, reply.revision, !how.check, how.confirm_minutes,
                      how.check ? CTL_WOULD_CHANGE : CTL_OK);
 }
+} // namespace
 
 int ctl_apply(const ctl_options &options, const std::string &file, const ctl_apply_options &how) {
     std::string content, errors;
@@ -235,9 +235,8 @@ namespace {
 struct kept_commit {
     std::string number, time, user, cause, changes, what, confirm_by, returns_to;
 };
-} // namespace
 
-static std::vector<kept_commit> commits_of(const std::vector<ctl_binding> &bindings) {
+std::vector<kept_commit> commits_of(const std::vector<ctl_binding> &bindings) {
     static const struct {
         const char *name;
         std::string kept_commit::*field;
@@ -263,11 +262,11 @@ static std::vector<kept_commit> commits_of(const std::vector<ctl_binding> &bindi
             if (name.parts.back() == row.name)
                 out.back().*row.field = binding.value;
     }
-    std::ranges::reverse(out); // the last one first
+    std::ranges::reverse(out); // the latest first
     return out;
 }
 
-static std::string local_time(const std::string &seconds, const char *format) {
+std::string local_time(const std::string &seconds, const char *format) {
     const time_t at = strtoll(seconds.c_str(), nullptr, 10);
     tm broken{};
     char text[64];
@@ -275,7 +274,7 @@ static std::string local_time(const std::string &seconds, const char *format) {
     return {text, strftime(text, sizeof text, format, &broken)};
 }
 
-static ctl_json json_commit(const kept_commit &commit) {
+ctl_json json_commit(const kept_commit &commit) {
     const auto number = [](const std::string &text) { return json_value({"", "int64", text}); };
     const auto optional = [](const std::string &text, const ctl_json &value) {
         return text.empty() ? ctl_json(nullptr) : value;
@@ -290,7 +289,7 @@ static ctl_json json_commit(const kept_commit &commit) {
             {"returns_to", optional(commit.returns_to, number(commit.returns_to))}};
 }
 
-static std::string text_commit(const kept_commit &commit) {
+std::string text_commit(const kept_commit &commit) {
     std::string out = commit.number +
                       std::string(commit.number.size() < 5 ? 6 - commit.number.size() : 1, ' ') +
                       local_time(commit.time, "%F %T  ") + (commit.user.empty() ? "-" : commit.user) + "  " +
@@ -305,7 +304,7 @@ static std::string text_commit(const kept_commit &commit) {
 }
 
 // False when the failure has been printed.
-static bool get_history(connection *mgmtd, std::vector<kept_commit> *out) {
+bool get_history(connection *mgmtd, std::vector<kept_commit> *out) {
     ctl_reply reply;
     if (!mgmtd->session)
         return false;
@@ -316,6 +315,7 @@ static bool get_history(connection *mgmtd, std::vector<kept_commit> *out) {
     *out = commits_of(reply.bindings);
     return mgmtd->code == CTL_OK;
 }
+} // namespace
 
 int ctl_history(const ctl_options &options) {
     connection mgmtd(options);
@@ -333,8 +333,9 @@ int ctl_history(const ctl_options &options) {
     return CTL_OK;
 }
 
-// Without numbers: what the last commit has changed.
-static bool choose_commits(connection *mgmtd, uint32_t *inout_from) {
+namespace {
+// Without a number, the comparison begins at the commit before the last one.
+bool choose_commits(connection *mgmtd, uint32_t *inout_from) {
     std::vector<kept_commit> commits;
     if (*inout_from != 0)
         return true;
@@ -347,6 +348,7 @@ static bool choose_commits(connection *mgmtd, uint32_t *inout_from) {
         *inout_from = static_cast<uint32_t>(std::strtoul(commits[1].number.c_str(), nullptr, 10));
     return *inout_from != 0;
 }
+} // namespace
 
 int ctl_diff(const ctl_options &options, uint32_t from, uint32_t to) {
     connection mgmtd(options);
@@ -364,7 +366,7 @@ int ctl_diff(const ctl_options &options, uint32_t from, uint32_t to) {
     return CTL_OK;
 }
 
-// A commit of its own, which also ends the wait of one that is not confirmed.
+// A new commit, which is allowed while another one waits to be confirmed, and ends that wait.
 int ctl_rollback(const ctl_options &options, uint32_t number) {
     connection mgmtd(options);
     config_text wanted, present;

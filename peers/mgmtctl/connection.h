@@ -1,4 +1,4 @@
-// A session of a command that goes on only with mgmtd.
+// The session of a command that can do nothing without mgmtd.
 #pragma once
 
 #include <memory>
@@ -12,7 +12,7 @@ struct ctl_session_closer {
 };
 using ctl_held_session = std::unique_ptr<ctl_session, ctl_session_closer>;
 
-// A session, or the exit code of its failure, which has been printed.
+// A session; or null and the exit code of the failure, which has been printed.
 struct connection {
     const ctl_options &options;
     ctl_held_session session;

@@ -1,5 +1,5 @@
-// "mgmtctl drain": groups are emptied before they leave their routers. mgmtd keeps the request and its time;
-// what waits here only looks, and can be interrupted without consequence.
+// "mgmtctl drain": groups are emptied before they leave their routers. mgmtd keeps the request and its time.
+// Waiting here only reads the progress, and can be interrupted without consequence.
 #include <algorithm>
 #include <charconv>
 #include <ctime>
@@ -14,19 +14,18 @@
 #include "peers/mgmtctl/traffic_json.h"
 #include "runtime/common.h"
 
-static constexpr timespec LOOK_AGAIN = {0, 500'000'000};
-
 namespace {
+constexpr timespec LOOK_AGAIN = {0, 500'000'000};
+
 struct drain_wish {
     enum { begin, cancel, show } verb = begin;
     std::string group;   // "": all
     std::string seconds; // "": as configured
     bool wait = false;
 };
-} // namespace
 
-// Empty, or what is wrong.
-static std::string parse_wish(const std::vector<std::string> &words, drain_wish *out) {
+// Returns "", or what is wrong.
+std::string parse_wish(const std::vector<std::string> &words, drain_wish *out) {
     static const char *const USAGE = "drain [GROUP] [for SECONDS] [wait], drain cancel [GROUP], drain show";
     size_t at = 0;
     if (!words.empty() && (words[0] == "cancel" || words[0] == "show")) {
@@ -50,7 +49,7 @@ static std::string parse_wish(const std::vector<std::string> &words, drain_wish 
     return "";
 }
 
-static bool ask_drains(const ctl_link &link, std::vector<traffic_drain> *out, ctl_failure *out_failure) {
+bool ask_drains(const ctl_link &link, std::vector<traffic_drain> *out, ctl_failure *out_failure) {
     ctl_reply reply;
     out->clear();
     if (!link.query(ctl_walk::subtree, NODE_DRAINS, &reply, &out_failure->error)) {
@@ -63,12 +62,12 @@ static bool ask_drains(const ctl_link &link, std::vector<traffic_drain> *out, ct
     return true;
 }
 
-static void put_drain(const traffic_drain &drain) {
+void put_drain(const traffic_drain &drain) {
     put("group " + std::to_string(drain.group) + ": " + drain_text(drain, time(nullptr)) + "\n");
 }
 
-// Lines for what has changed.
-static void put_progress(const std::vector<traffic_drain> &before, const std::vector<traffic_drain> &now) {
+// Prints the drains that have changed.
+void put_progress(const std::vector<traffic_drain> &before, const std::vector<traffic_drain> &now) {
     for (const traffic_drain &drain : now)
         if (std::none_of(before.begin(), before.end(), [&](const traffic_drain &each) {
                 return each.group == drain.group && each.state == drain.state && each.flows == drain.flows;
@@ -76,13 +75,13 @@ static void put_progress(const std::vector<traffic_drain> &before, const std::ve
             put_drain(drain);
 }
 
-static void leave_out_others(const std::string &group, std::vector<traffic_drain> *inout) {
+void leave_out_others(const std::string &group, std::vector<traffic_drain> *inout) {
     std::erase_if(*inout, [&](const traffic_drain &each) {
         return !group.empty() && std::to_string(each.group) != group;
     });
 }
 
-static int tell_end(const ctl_options &options, const std::vector<traffic_drain> &drains, size_t expected) {
+int tell_end(const ctl_options &options, const std::vector<traffic_drain> &drains, size_t expected) {
     const bool cancelled = drains.size() < expected;
     const bool over =
         std::any_of(drains.begin(), drains.end(), [](const auto &each) { return each.state != "drained"; });
@@ -98,7 +97,7 @@ static int tell_end(const ctl_options &options, const std::vector<traffic_drain>
     return cancelled || over ? CTL_REFUSED : CTL_OK;
 }
 
-static int wait_for_end(const ctl_options &options, const ctl_link &link, const std::string &group) {
+int wait_for_end(const ctl_options &options, const ctl_link &link, const std::string &group) {
     std::vector<traffic_drain> before, drains;
     ctl_failure failure = {CTL_OK, "", "", "", 0};
     size_t expected = 0;
@@ -120,7 +119,7 @@ static int wait_for_end(const ctl_options &options, const ctl_link &link, const 
     }
 }
 
-static int tell_drains(const ctl_options &options, const ctl_link &link, const std::string &group) {
+int tell_drains(const ctl_options &options, const ctl_link &link, const std::string &group) {
     std::vector<traffic_drain> drains;
     ctl_failure failure = {CTL_OK, "", "", "", 0};
     if (!ask_drains(link, &drains, &failure))
@@ -133,6 +132,7 @@ static int tell_drains(const ctl_options &options, const ctl_link &link, const s
             put_drain(drain);
     return CTL_OK;
 }
+} // namespace
 
 int run_drain(const ctl_options &options, const ctl_link &link, const std::vector<std::string> &words) {
     drain_wish wish;

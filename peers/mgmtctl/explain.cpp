@@ -1,4 +1,4 @@
-// "mgmtctl explain": each reason with its values, its time and what to do.
+// "mgmtctl explain": each reason with its cause, its time and the next step.
 #include <algorithm>
 
 #include <nlohmann/json.hpp>
@@ -12,7 +12,8 @@
 // The exit codes are explain's own: scripts ask whether anything needs attention.
 enum explain_exit : int { EXPLAIN_FINE = 0, EXPLAIN_ATTENTION = 1, EXPLAIN_FAILED = 2 };
 
-static std::string head_of(const snapshot &shown, int id) {
+namespace {
+std::string heading_of(const snapshot &shown, int id) {
     if (id < 0)
         return "appliance\n";
     std::string text = "group " + std::to_string(id);
@@ -22,29 +23,31 @@ static std::string head_of(const snapshot &shown, int id) {
     return text + "\n";
 }
 
-static std::string text_of(const reason &one) {
+std::string reason_words(const reason &one) {
     const std::string times = reason_times(one);
     return "  " + one.code + ": " + one.cause + "\n" + (times.empty() ? "" : "    " + times + "\n") +
            "    next: " + one.next + "\n";
 }
 
-static void put_reasons(const snapshot &shown, const std::vector<reason> &reasons) {
+void print_reasons(const snapshot &shown, const std::vector<reason> &reasons) {
     std::vector<int> ids;
     if (std::any_of(reasons.begin(), reasons.end(), [](const reason &each) { return each.group < 0; }))
         ids.push_back(-1);
     for (const snapshot_group &group : shown.groups)
         ids.push_back(group.id);
     for (const int id : ids) {
-        put(head_of(shown, id));
+        put(heading_of(shown, id));
         if (!main_reason(reasons, id))
-            put("  nothing needs attention\n");
+            put(id < 0 || shown.wccpd == wccpd_condition::running ? "  nothing needs attention\n"
+                                                                  : "  unknown without wccpd\n");
         for (const reason &each : reasons)
             if (each.group == id)
-                put(text_of(each));
+                put(reason_words(each));
     }
     if (ids.empty())
         put("no group is configured\n");
 }
+} // namespace
 
 int tell_reasons(const ctl_options &options, const snapshot &shown, int group) {
     std::vector<reason> reasons = reasons_of(shown);
@@ -62,7 +65,7 @@ int tell_reasons(const ctl_options &options, const snapshot &shown, int group) {
             all.push_back(reason_json(each));
         put(json_line({{"attention", attention}, {"reasons", all}, {"exit", exit}}));
     } else {
-        put_reasons(shown, reasons);
+        print_reasons(shown, reasons);
     }
     return exit;
 }

@@ -1,4 +1,4 @@
-// "mgmtctl group" and "mgmtctl policy": their session, and what a person and a script get to read.
+// "mgmtctl group" and "mgmtctl policy": their session, and their output for people and scripts.
 #include <cstdio>
 #include <map>
 
@@ -12,9 +12,10 @@
 #include "peers/mgmtctl/render.h"
 #include "peers/nodes/secrets.h"
 
-static constexpr size_t SECRET_MAX = 256; // more than any password has; mgmtd says what is too long
+namespace {
+constexpr size_t SECRET_MAX = 256; // more than any password has; mgmtd refuses what is too long
 
-static ctl_json as_json(const group_result &result) {
+ctl_json result_json(const group_result &result) {
     ctl_json out = {{result.kind == "group" ? "group" : "policy",
                      result.number < 0 ? ctl_json(nullptr) : ctl_json(result.number)},
                     {"done", result.done.empty() ? "nothing" : result.done},
@@ -35,7 +36,7 @@ static ctl_json as_json(const group_result &result) {
     return out;
 }
 
-static std::string as_text(const group_result &result) {
+std::string result_text(const group_result &result) {
     static const std::map<std::string, std::string> outcomes = {
         {"added", " added"},     {"changed", " changed"},       {"recreated", " deleted and created again"},
         {"deleted", " deleted"}, {"unchanged", " is as asked"},
@@ -56,11 +57,11 @@ static std::string as_text(const group_result &result) {
     return text;
 }
 
-static int tell(const ctl_options &options, const group_result &result) {
+int report_result(const ctl_options &options, const group_result &result) {
     if (options.json)
-        put(json_line(as_json(result)));
+        put(json_line(result_json(result)));
     else if (result.exit == CTL_OK)
-        put(as_text(result) + "\n");
+        put(result_text(result) + "\n");
     else
         return tell_failure(
             options, {result.exit, result.number < 0 ? "" : result.kind + " " + std::to_string(result.number),
@@ -68,7 +69,7 @@ static int tell(const ctl_options &options, const group_result &result) {
     return result.exit;
 }
 
-static int list_words(const ctl_options &options) {
+int list_words(const ctl_options &options) {
     ctl_json all = ctl_json::array();
     for (const group_word &word : group_words()) {
         const char *fallback = group_word_fallback(word);
@@ -79,15 +80,15 @@ static int list_words(const ctl_options &options) {
                        {"node", word.node},
                        {"values", group_word_values(word)},
                        {"default", fallback ? ctl_json(fallback) : ctl_json(nullptr)},
-                       {"recreates", word.whole}});
+                       {"recreates", word.change == group_change::as_whole}});
     }
     if (options.json)
         put(json_line(all));
     return CTL_OK;
 }
 
-// Each group as the words that would add it.
-static void tell_list(const ctl_options &options, const std::vector<listed_group> &groups) {
+// Prints each group as the words that would add it.
+void tell_list(const ctl_options &options, const std::vector<listed_group> &groups) {
     ctl_json all = ctl_json::array();
     for (const listed_group &group : groups) {
         const std::vector<std::string> routers = group_routers(group.nodes);
@@ -112,25 +113,26 @@ static void tell_list(const ctl_options &options, const std::vector<listed_group
         put(json_line(all));
 }
 
-static int run(const ctl_options &options, const std::vector<std::string> &words, const char *above,
-               const char *kind,
-               group_result (*command)(const ctl_link &link, const std::vector<std::string> &words)) {
+int run_words(const ctl_options &options, const std::vector<std::string> &words, const char *above,
+              const char *kind,
+              group_result (*command)(const ctl_link &link, const std::vector<std::string> &words)) {
     const ctl_link link = link_to_mgmtd(options);
     if (words.size() == 1 && words[0] == "list") {
         std::vector<listed_group> groups;
         group_result result = list_groups(link, above, &groups);
         result.kind = kind;
         if (result.exit != CTL_OK)
-            return tell(options, result);
+            return report_result(options, result);
         tell_list(options, groups);
         return CTL_OK;
     }
-    return tell(options, command(link, words));
+    return report_result(options, command(link, words));
 }
 
-// A line of standard input, which everybody on the machine could read in a command line. A terminal is asked,
-// and doesn't show it. False at the end of the input, or when a signal ends the program.
-static bool read_secret(std::string *out) {
+// Reads the password from a line of standard input, because a command line can be read by everybody on the
+// machine. On a terminal it is prompted for, and not echoed. False at the end of the input, or when a signal
+// ends the program.
+bool read_secret(std::string *out) {
     termios before = {};
     const bool terminal = tcgetattr(STDIN_FILENO, &before) == 0;
     if (terminal) {
@@ -150,6 +152,7 @@ static bool read_secret(std::string *out) {
     }
     return got == 1 || (got == 0 && !out->empty());
 }
+} // namespace
 
 int ctl_group(const ctl_options &options, const std::vector<std::string> &words) {
     if (words.size() == 1 && words[0] == "words")
@@ -158,9 +161,9 @@ int ctl_group(const ctl_options &options, const std::vector<std::string> &words)
     for (size_t i = 3; i < filled.size(); i += 2)
         if (filled[i - 1] == "password" && filled[i] == "-" && !read_secret(&filled[i]))
             return tell_failure(options, {CTL_USAGE, "", "there is no password on standard input", "", 0});
-    return run(options, filled, NODE_GROUP_CONFIG, "group", group_command);
+    return run_words(options, filled, NODE_GROUP_CONFIG, "group", group_command);
 }
 
 int ctl_policy(const ctl_options &options, const std::vector<std::string> &words) {
-    return run(options, words, NODE_POLICY_CONFIG, "policy group", policy_command);
+    return run_words(options, words, NODE_POLICY_CONFIG, "policy group", policy_command);
 }

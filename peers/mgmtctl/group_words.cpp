@@ -10,36 +10,40 @@
 
 const std::vector<group_word> &group_words() {
     static const std::vector<group_word> words = {
-        {"interface", "interface", "NAME, or none", true, false},
-        {"router", "router", "ADDRESS, once for each router; together they are the new list", true, false},
-        {"weight", "weight", nullptr, false, false},
-        {"password", "password", "up to 8 characters; \"\" for none, - to be asked for it", false, true},
-        {"policy", "policy_grp", "1 to 65535, or none", false, false},
-        {"admin", "admin", nullptr, false, false},
-        {"priority", "priority", nullptr, true, false},
-        {"protocol", "protocol", "a name, or 1 to 255", true, false},
-        {"encap", "encap", nullptr, false, false},
-        {"force_l2_return", "force_l2_return", nullptr, false, false},
-        {"assign", "assign_method", nullptr, false, false},
-        {"detail", "assign_detail", "a text", false, true},
-        {"hash_src_ip", "hash_src_ip", nullptr, false, false},
-        {"hash_dst_ip", "hash_dst_ip", nullptr, false, false},
-        {"hash_src_port", "hash_src_port", nullptr, false, false},
-        {"hash_dst_port", "hash_dst_port", nullptr, false, false},
-        {"mask_src_ip", "mask_src_ip", nullptr, false, false},
-        {"mask_dst_ip", "mask_dst_ip", nullptr, false, false},
-        {"mask_src_port", "mask_src_port", nullptr, false, false},
-        {"mask_dst_port", "mask_dst_port", nullptr, false, false},
-        {"compatibility", "compatibility", nullptr, false, false},
+        {"interface", "interface", "NAME, or none", group_change::as_whole, false},
+        {"router", "router", "ADDRESS, once for each router; together they are the new list",
+         group_change::as_whole, false},
+        {"weight", "weight", nullptr, group_change::at_once, false},
+        {"password", "password", "up to 8 characters; \"\" for none, - to be asked for it",
+         group_change::at_once, true},
+        {"policy", "policy_grp", "1 to 65535, or none", group_change::at_once, false},
+        {"admin", "admin", nullptr, group_change::at_once, false},
+        {"priority", "priority", nullptr, group_change::as_whole, false},
+        {"protocol", "protocol", "a name, or 1 to 255", group_change::as_whole, false},
+        {"encap", "encap", nullptr, group_change::at_start, false},
+        {"force_l2_return", "force_l2_return", nullptr, group_change::at_start, false},
+        {"assign", "assign_method", nullptr, group_change::at_start, false},
+        {"detail", "assign_detail", "a text", group_change::at_once, true},
+        {"hash_src_ip", "hash_src_ip", nullptr, group_change::at_once, false},
+        {"hash_dst_ip", "hash_dst_ip", nullptr, group_change::at_once, false},
+        {"hash_src_port", "hash_src_port", nullptr, group_change::at_once, false},
+        {"hash_dst_port", "hash_dst_port", nullptr, group_change::at_once, false},
+        {"mask_src_ip", "mask_src_ip", nullptr, group_change::at_start, false},
+        {"mask_dst_ip", "mask_dst_ip", nullptr, group_change::at_start, false},
+        {"mask_src_port", "mask_src_port", nullptr, group_change::at_start, false},
+        {"mask_dst_port", "mask_dst_port", nullptr, group_change::at_start, false},
+        {"compatibility", "compatibility", nullptr, group_change::at_once, false},
     };
     return words;
 }
 
-static const schema_row *row_of(const group_word &word) {
+namespace {
+const schema_row *row_of(const group_word &word) {
     node_name name;
     return parse_node_name(std::string(NODE_GROUP_CONFIG) + "/0/" + word.node, &name) ? find_schema_row(name)
                                                                                       : nullptr;
 }
+} // namespace
 
 const char *group_word_fallback(const group_word &word) {
     const schema_row *row = row_of(word);

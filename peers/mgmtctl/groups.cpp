@@ -1,11 +1,11 @@
-// Groups and policy groups are changed in the words of an operator, each command in one commit.
+// Groups and policy groups are changed in the words of an operator. Each command is one commit.
 //
-// mgmtd has wccpd delete and create a running group that cannot follow a change, within the one commit.
-// "restart" asks for that by deleting and creating the group in its commit, with what was set. A value that
-// equals the default of its node is left out then: the configuration file holds no defaults.
+// When a running group cannot follow a change, mgmtd has wccpd delete the group and create it again, within
+// the same commit. "restart" causes the same by a commit that deletes the group and creates it as it was set.
+// Values that equal their default are left out then, because the configuration file holds no defaults.
 //
-// After a change, wccpd's list of groups is read until it agrees, for some seconds at most. It is the list
-// and not the group, because a query for a group that wccpd doesn't have is an error line in its log.
+// After a change, wccpd's list of groups is read until it agrees, for a few seconds at most. The list is read
+// and not the group, because a query for a group that wccpd does not have is an error in wccpd's log.
 #include "peers/mgmtctl/groups.h"
 
 #include <algorithm>
@@ -19,48 +19,49 @@
 #include "peers/mgmtctl/nodes.h"
 #include "runtime/common.h"
 
-static group_result failed(group_result result, int exit, const std::string &error, uint32_t code = 0) {
+namespace {
+group_result with_failure(group_result result, int exit, const std::string &error, uint32_t code = 0) {
     result.exit = exit;
     result.error = error;
     result.code = code;
     return result;
 }
-static bool parse_number(const std::string &text, long *out) {
+bool parse_number(const std::string &text, long *out) {
     if (text.empty() || text.size() > 6 || text.find_first_not_of("0123456789") != std::string::npos)
         return false;
     *out = std::stol(text);
     return true;
 }
 
-// --- The groups that there are
+// --- Existing groups
 
-static std::string root_of(const char *above, long number) {
+std::string numbered_root(const char *above, long number) {
     return std::string(above) + "/" + std::to_string(number);
 }
 
-// False: there was no answer, or a refusal, which `inout` has.
-static bool ask(const ctl_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
-                group_result *inout) {
+// False: there was no answer, or a refusal; `inout` holds it.
+bool ask_mgmtd(const ctl_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
+               group_result *inout) {
     std::string reason;
     if (!link.query(walk, name, out, &reason))
-        *inout = failed(*inout, CTL_UNREACHABLE, reason);
+        *inout = with_failure(*inout, CTL_UNREACHABLE, reason);
     else if (out->code != 0)
-        *inout = failed(*inout, CTL_REFUSED, out->message, out->code);
+        *inout = with_failure(*inout, CTL_REFUSED, out->message, out->code);
     return inout->exit == CTL_OK;
 }
 
-static bool stands(const ctl_link &link, const std::string &root, group_result *inout, bool *out_stands) {
+bool find_root(const ctl_link &link, const std::string &root, group_result *inout, bool *out_stands) {
     ctl_reply reply;
-    if (!ask(link, ctl_walk::node, root, &reply, inout))
+    if (!ask_mgmtd(link, ctl_walk::node, root, &reply, inout))
         return false;
     *out_stands = !reply.bindings.empty();
     return true;
 }
 
-// What was set of a group, except for values that are the default.
-static bool read_group(const ctl_link &link, const std::string &root, group_nodes *out, group_result *inout) {
+// Reads the nodes of a group that were set, without those that have their default.
+bool read_group(const ctl_link &link, const std::string &root, group_nodes *out, group_result *inout) {
     ctl_reply reply;
-    if (!ask(link, ctl_walk::subtree, root, &reply, inout))
+    if (!ask_mgmtd(link, ctl_walk::subtree, root, &reply, inout))
         return false;
     for (const ctl_binding &binding : reply.bindings) {
         if (!binding.name.starts_with(root + "/"))
@@ -73,6 +74,7 @@ static bool read_group(const ctl_link &link, const std::string &root, group_node
     }
     return true;
 }
+} // namespace
 
 std::vector<std::string> group_routers(const group_nodes &nodes) {
     std::map<long, std::string> numbered;
@@ -86,42 +88,44 @@ std::vector<std::string> group_routers(const group_nodes &nodes) {
     return out;
 }
 
-static void put_routers(const std::vector<std::string> &routers, group_nodes *inout) {
+namespace {
+void store_routers(const std::vector<std::string> &routers, group_nodes *inout) {
     std::erase_if(*inout, [](const auto &node) { return node.first.starts_with("router/"); });
     for (size_t i = 0; i < routers.size(); i++)
         (*inout)["router/" + std::to_string(i + 1) + "/ipaddr"] = routers[i];
 }
 
-static std::vector<ctl_change_item> creation(const std::string &root, const group_nodes &nodes) {
+std::vector<ctl_change_item> creation_items(const std::string &root, const group_nodes &nodes) {
     std::vector<ctl_change_item> items = {{ctl_change::create, {root, "", root.substr(root.rfind('/') + 1)}}};
     for (const auto &[name, value] : nodes)
-        if (!name.starts_with("router/") || name.ends_with("/ipaddr")) // an entry comes with its address
+        if (!name.starts_with("router/") ||
+            name.ends_with("/ipaddr")) // the entry itself is created with its address
             items.push_back({ctl_change::create, {std::string(root).append("/").append(name), "", value}});
     return items;
 }
 
 // --- Changes
 
-static bool commit(const ctl_link &link, const std::vector<ctl_change_item> &items, group_result *inout) {
+bool commit_items(const ctl_link &link, const std::vector<ctl_change_item> &items, group_result *inout) {
     ctl_reply reply;
     std::string reason;
     if (!link.set(items, &reply, &reason)) {
-        *inout = failed(*inout, CTL_UNREACHABLE, reason);
+        *inout = with_failure(*inout, CTL_UNREACHABLE, reason);
         return false;
     }
     if (reply.code != 0) {
-        *inout = failed(*inout, CTL_REFUSED, reply.message, reply.code);
+        *inout = with_failure(*inout, CTL_REFUSED, reply.message, reply.code);
         return false;
     }
     inout->commits++;
     return true;
 }
 
-// Looks at what wccpd has, until it has the group or hasn't it any more.
-static void settle(const ctl_link &link, bool wanted, group_result *inout) {
+// Waits until wccpd has the group, or no longer has it, and reads its state.
+void wait_for_wccpd(const ctl_link &link, bool wanted, group_result *inout) {
     using clock = std::chrono::steady_clock;
     const auto until = clock::now() + std::chrono::milliseconds(link.settle_ms);
-    const std::string root = root_of(NODE_GROUP_STATE, inout->number);
+    const std::string root = numbered_root(NODE_GROUP_STATE, inout->number);
     std::string reason;
     ctl_reply reply;
     for (;;) {
@@ -150,66 +154,64 @@ static void settle(const ctl_link &link, bool wanted, group_result *inout) {
     inout->designated = oper.ends_with(", DESIGNATED");
 }
 
-// What mgmtd takes, and what is of no use all the same.
-static std::string what_it_lacks(const group_nodes &nodes) {
+// mgmtd accepts a group without these, but such a group does nothing.
+std::string missing_part_note(const group_nodes &nodes) {
     if (!nodes.contains("interface"))
         return "without an interface it takes no part";
     return group_routers(nodes).empty() ? "without a router it takes no part" : "";
 }
 
-static void group_add(const ctl_link &link, const std::string &root, const group_wish &wish,
-                      group_result *inout) {
+void add_group(const ctl_link &link, const std::string &root, const group_wish &wish, group_result *inout) {
     bool there = false;
-    if (!stands(link, root, inout, &there))
+    if (!find_root(link, root, inout, &there))
         return;
     if (there) {
-        *inout = failed(*inout, CTL_REFUSED,
-                        "there is a group " + std::to_string(inout->number) +
-                            "; \"mgmtctl group set\" changes it");
+        *inout = with_failure(*inout, CTL_REFUSED,
+                              "there is a group " + std::to_string(inout->number) +
+                                  "; \"mgmtctl group set\" changes it");
         return;
     }
     group_nodes nodes;
     for (const auto &[node, value] : wish.values)
         if (value)
             nodes[node] = *value;
-    put_routers(wish.routers.value_or(std::vector<std::string>{}), &nodes);
-    if (commit(link, creation(root, nodes), inout)) {
+    store_routers(wish.routers.value_or(std::vector<std::string>{}), &nodes);
+    if (commit_items(link, creation_items(root, nodes), inout)) {
         inout->done = "added";
-        inout->note = what_it_lacks(nodes);
-        settle(link, true, inout);
+        inout->note = missing_part_note(nodes);
+        wait_for_wccpd(link, true, inout);
     }
 }
 
-// Of a group that has to be there, what was set.
-static bool read_standing(const ctl_link &link, const std::string &root, group_nodes *out,
-                          group_result *inout) {
+// The same, of a group that has to exist.
+bool read_existing_group(const ctl_link &link, const std::string &root, group_nodes *out,
+                         group_result *inout) {
     bool there = false;
-    if (!stands(link, root, inout, &there))
+    if (!find_root(link, root, inout, &there))
         return false;
     if (!there) {
-        *inout = failed(*inout, CTL_NOT_FOUND, "there is no group " + std::to_string(inout->number));
+        *inout = with_failure(*inout, CTL_NOT_FOUND, "there is no group " + std::to_string(inout->number));
         return false;
     }
     return read_group(link, root, out, inout);
 }
 
-static void group_restart(const ctl_link &link, const std::string &root, group_result *inout) {
+void restart_group(const ctl_link &link, const std::string &root, group_result *inout) {
     group_nodes nodes;
-    if (!read_standing(link, root, &nodes, inout))
+    if (!read_existing_group(link, root, &nodes, inout))
         return;
-    std::vector<ctl_change_item> items = creation(root, nodes);
+    std::vector<ctl_change_item> items = creation_items(root, nodes);
     items.insert(items.begin(), {ctl_change::remove, {root, "", ""}});
-    if (!commit(link, items, inout))
+    if (!commit_items(link, items, inout))
         return;
     inout->done = "recreated";
-    inout->note = what_it_lacks(nodes);
-    settle(link, true, inout);
+    inout->note = missing_part_note(nodes);
+    wait_for_wccpd(link, true, inout);
 }
 
-// The new list takes over the entries of the old one, from the first.
-static std::vector<ctl_change_item> router_changes(const std::string &root,
-                                                   const std::vector<std::string> &before,
-                                                   const std::vector<std::string> &after) {
+// The new list reuses the entries of the old one, from the first.
+std::vector<ctl_change_item> router_changes(const std::string &root, const std::vector<std::string> &before,
+                                            const std::vector<std::string> &after) {
     std::vector<ctl_change_item> items;
     for (size_t i = 0; i < std::max(before.size(), after.size()); i++) {
         const std::string entry = root + "/router/" + std::to_string(i + 1);
@@ -221,21 +223,17 @@ static std::vector<ctl_change_item> router_changes(const std::string &root,
     return items;
 }
 
-// What a group agrees with its routers, or computes for them, once and keeps.
-static const std::string taken_at_start[] = {"encap",       "assign_method", "force_l2_return", "mask_src_ip",
-                                             "mask_dst_ip", "mask_src_port", "mask_dst_port"};
-
-static void group_set(const ctl_link &link, const std::string &root, const group_wish &wish,
-                      group_result *inout) {
+void change_group(const ctl_link &link, const std::string &root, const group_wish &wish,
+                  group_result *inout) {
     group_nodes before;
-    if (!read_standing(link, root, &before, inout))
+    if (!read_existing_group(link, root, &before, inout))
         return;
     group_nodes after = before;
     std::vector<ctl_change_item> items;
     std::string as_whole, at_start;
     if (wish.routers) {
         items = router_changes(root, group_routers(before), *wish.routers);
-        put_routers(*wish.routers, &after);
+        store_routers(*wish.routers, &after);
         as_whole = items.empty() ? "" : "router";
     }
     for (const auto &[node, value] : wish.values) {
@@ -253,68 +251,68 @@ static void group_set(const ctl_link &link, const std::string &root, const group
         else
             after.erase(node);
         items.push_back({value ? ctl_change::modify : ctl_change::reset, {name, "", value ? *to : ""}});
-        if (std::count(std::begin(taken_at_start), std::end(taken_at_start), node) > 0)
+        if (word->change == group_change::at_start)
             at_start += std::string(at_start.empty() ? "" : ", ") + word->word;
-        if (word->whole || (!value && !fallback))
+        if (word->change == group_change::as_whole || (!value && !fallback))
             as_whole += std::string(as_whole.empty() ? "" : ", ") + word->word;
     }
     if (items.empty()) {
         inout->done = "unchanged";
-    } else if (!commit(link, items, inout)) {
+    } else if (!commit_items(link, items, inout)) {
         return;
     } else if (as_whole.empty()) {
         inout->done = "changed";
         if (!at_start.empty())
-            inout->note = "a group that runs follows a change of " + at_start +
-                          " when it is started again: mgmtctl group restart " + std::to_string(inout->number);
+            inout->note = at_start_note(at_start, std::to_string(inout->number));
     } else {
-        const std::string lack = what_it_lacks(after);
+        const std::string lack = missing_part_note(after);
         inout->done = "recreated";
         inout->note = "wccpd takes a change of " + as_whole + " only with the group as a whole" +
                       (lack.empty() ? "" : "; " + lack);
     }
-    settle(link, true, inout);
+    wait_for_wccpd(link, true, inout);
 }
 
-static void remove_root(const ctl_link &link, const std::string &root, group_result *inout) {
-    if (commit(link, {{ctl_change::remove, {root, "", ""}}}, inout))
+void delete_root(const ctl_link &link, const std::string &root, group_result *inout) {
+    if (commit_items(link, {{ctl_change::remove, {root, "", ""}}}, inout))
         inout->done = "deleted";
     else if (inout->code == LC_NOT_FOUND)
-        *inout = failed(*inout, CTL_NOT_FOUND,
-                        "there is no " + inout->kind + " " + std::to_string(inout->number), inout->code);
+        *inout =
+            with_failure(*inout, CTL_NOT_FOUND,
+                         "there is no " + inout->kind + " " + std::to_string(inout->number), inout->code);
 }
 
-static const char *const GROUP_USAGE =
-    "group add N [WORD VALUE ...], group set N WORD VALUE ..., group restart "
-    "N, group delete N; \"group words\" lists the words";
+const char *const GROUP_USAGE = "group add N [WORD VALUE ...], group set N WORD VALUE ..., group restart "
+                                "N, group delete N; \"group words\" lists the words";
+} // namespace
 
 group_result group_command(const ctl_link &link, const std::vector<std::string> &words) {
     group_result result;
     result.kind = "group";
     const std::string verb = words.empty() ? "" : words[0];
     if (verb != "add" && verb != "set" && verb != "restart" && verb != "delete")
-        return failed(result, CTL_USAGE,
-                      verb.empty()
-                          ? GROUP_USAGE
-                          : unknown_word_text(verb, {"add", "set", "restart", "delete", "list", "words"}));
+        return with_failure(
+            result, CTL_USAGE,
+            verb.empty() ? GROUP_USAGE
+                         : unknown_word_text(verb, {"add", "set", "restart", "delete", "list", "words"}));
     if (words.size() < 2 || !parse_number(words[1], &result.number) || (verb == "set" && words.size() < 3))
-        return failed(result, CTL_USAGE, GROUP_USAGE);
+        return with_failure(result, CTL_USAGE, GROUP_USAGE);
     group_wish wish;
     if ((verb == "delete" || verb == "restart") && words.size() > 2)
-        return failed(result, CTL_USAGE, GROUP_USAGE);
+        return with_failure(result, CTL_USAGE, GROUP_USAGE);
     if (const std::string wrong = parse_group_wish(words, &wish); !wrong.empty())
-        return failed(result, CTL_USAGE, wrong);
-    const std::string root = root_of(NODE_GROUP_CONFIG, result.number);
+        return with_failure(result, CTL_USAGE, wrong);
+    const std::string root = numbered_root(NODE_GROUP_CONFIG, result.number);
     if (verb == "add") {
-        group_add(link, root, wish, &result);
+        add_group(link, root, wish, &result);
     } else if (verb == "set") {
-        group_set(link, root, wish, &result);
+        change_group(link, root, wish, &result);
     } else if (verb == "restart") {
-        group_restart(link, root, &result);
+        restart_group(link, root, &result);
     } else {
-        remove_root(link, root, &result);
+        delete_root(link, root, &result);
         if (result.exit == CTL_OK)
-            settle(link, false, &result);
+            wait_for_wccpd(link, false, &result);
     }
     return result;
 }
@@ -325,27 +323,27 @@ group_result policy_command(const ctl_link &link, const std::vector<std::string>
     result.kind = "policy group";
     const std::string verb = words.empty() ? "" : words[0];
     if (verb != "add" && verb != "delete")
-        return failed(result, CTL_USAGE,
-                      verb.empty() ? USAGE : unknown_word_text(verb, {"add", "delete", "list"}));
+        return with_failure(result, CTL_USAGE,
+                            verb.empty() ? USAGE : unknown_word_text(verb, {"add", "delete", "list"}));
     if (words.size() < 2 || !parse_number(words[1], &result.number) ||
         (words.size() != 2 && (verb == "delete" || words.size() != 4)))
-        return failed(result, CTL_USAGE, USAGE);
+        return with_failure(result, CTL_USAGE, USAGE);
     if (words.size() == 4 && words[2] != "name")
-        return failed(result, CTL_USAGE, unknown_word_text(words[2], {"name"}));
-    const std::string root = root_of(NODE_POLICY_CONFIG, result.number);
+        return with_failure(result, CTL_USAGE, unknown_word_text(words[2], {"name"}));
+    const std::string root = numbered_root(NODE_POLICY_CONFIG, result.number);
     if (verb == "delete") {
-        remove_root(link, root, &result);
+        delete_root(link, root, &result);
         return result;
     }
     bool there = false;
-    if (!stands(link, root, &result, &there))
+    if (!find_root(link, root, &result, &there))
         return result;
     if (there)
-        return failed(result, CTL_REFUSED, "there is a policy group " + std::to_string(result.number));
+        return with_failure(result, CTL_REFUSED, "there is a policy group " + std::to_string(result.number));
     group_nodes nodes;
     if (words.size() == 4)
         nodes["name"] = words[3];
-    if (commit(link, creation(root, nodes), &result))
+    if (commit_items(link, creation_items(root, nodes), &result))
         result.done = "added";
     return result;
 }
@@ -353,7 +351,7 @@ group_result policy_command(const ctl_link &link, const std::vector<std::string>
 group_result list_groups(const ctl_link &link, const std::string &above, std::vector<listed_group> *out) {
     group_result result;
     ctl_reply reply;
-    if (!ask(link, ctl_walk::children, above, &reply, &result))
+    if (!ask_mgmtd(link, ctl_walk::children, above, &reply, &result))
         return result;
     for (const ctl_binding &binding : reply.bindings) {
         out->push_back({binding.name.substr(binding.name.rfind('/') + 1), {}});

@@ -1,4 +1,4 @@
-// Changing groups and policy groups, apart from the session that carries the requests.
+// Changes of groups and policy groups, independent of the session that carries the requests.
 #pragma once
 
 #include <map>
@@ -25,7 +25,8 @@ struct group_result {
 group_result group_command(const ctl_link &link, const std::vector<std::string> &words);
 group_result policy_command(const ctl_link &link, const std::vector<std::string> &words);
 
-// What was set of a group, by its names below the group's root; a value that is the default is left out.
+// The nodes of a group that were set, by their names below the group's root, without those that have their
+// default.
 using group_nodes = std::map<std::string, std::string>;
 std::vector<std::string> group_routers(const group_nodes &nodes); // their addresses, in their order
 

@@ -1,5 +1,5 @@
-// A clause is a word and its values. A list ends at the first word that does not begin with a digit, which
-// no clause's word does.
+// A clause is a word and its values. A list ends at the first word that does not begin with a digit, since
+// clauses begin with a letter.
 #include "peers/mgmtctl/intercept_words.h"
 
 #include <algorithm>
@@ -8,18 +8,19 @@
 #include "peers/mgmtctl/group_words.h"
 #include "peers/nodes/schema.h"
 
-static const char *const PORT_AND_ALL = "\"port\" and \"all\" exclude each other";
+namespace {
+const char *const PORT_AND_ALL = "\"port\" and \"all\" exclude each other";
 
-static bool is_nothing(const std::string &value) {
+bool is_nothing(const std::string &value) {
     return value == "default" || value == "none";
 }
 
-static std::string needs_value(const intercept_word &row) {
+std::string needs_value(const intercept_word &row) {
     return std::string("\"") + row.word + "\" needs a value: " + row.values;
 }
 
-static std::string take_one(const intercept_word &row, const std::vector<std::string> &words,
-                            size_t *inout_at, intercept_wish *inout) {
+std::string take_one(const intercept_word &row, const std::vector<std::string> &words, size_t *inout_at,
+                     intercept_wish *inout) {
     if (*inout_at == words.size())
         return needs_value(row);
     const std::string &value = words[(*inout_at)++];
@@ -29,9 +30,9 @@ static std::string take_one(const intercept_word &row, const std::vector<std::st
     return inout->emplace(row.node, wanted).second ? "" : std::string("\"") + row.word + "\" is given twice";
 }
 
-// Each time that it is given adds to the list.
-static std::string take_list(const intercept_word &row, const std::vector<std::string> &words,
-                             size_t *inout_at, intercept_wish *inout) {
+// A clause that is given again adds to the list.
+std::string take_list(const intercept_word &row, const std::vector<std::string> &words, size_t *inout_at,
+                      intercept_wish *inout) {
     std::string list;
     while (*inout_at < words.size() && words[*inout_at][0] >= '0' && words[*inout_at][0] <= '9')
         list += (list.empty() ? "" : " ") + words[(*inout_at)++];
@@ -47,27 +48,27 @@ static std::string take_list(const intercept_word &row, const std::vector<std::s
     return "";
 }
 
-static std::string take_ports(const intercept_word &row, const std::vector<std::string> &words,
-                              size_t *inout_at, intercept_wish *inout) {
+std::string take_ports(const intercept_word &row, const std::vector<std::string> &words, size_t *inout_at,
+                       intercept_wish *inout) {
     if (*inout_at < words.size() && words[*inout_at] == "all")
-        return ""; // is a clause of its own
+        return ""; // "all" is a clause of its own
     return take_list(row, words, inout_at, inout);
 }
 
-static std::string take_all_ports(const intercept_word &row, const std::vector<std::string> &, size_t *,
-                                  intercept_wish *inout) {
+std::string take_all_ports(const intercept_word &row, const std::vector<std::string> &, size_t *,
+                           intercept_wish *inout) {
     const auto [at, fresh] = inout->emplace(row.node, "all");
     return fresh ? "" : at->second == "all" ? "\"all\" is given twice" : PORT_AND_ALL;
 }
 
-static std::string take_prefixes(const intercept_word &row, const std::vector<std::string> &words,
-                                 size_t *inout_at, intercept_wish *inout) {
+std::string take_prefixes(const intercept_word &row, const std::vector<std::string> &words, size_t *inout_at,
+                          intercept_wish *inout) {
     const bool nothing = *inout_at < words.size() && is_nothing(words[*inout_at]);
     return nothing ? take_one(row, words, inout_at, inout) : take_list(row, words, inout_at, inout);
 }
 
-static std::string take_check(const intercept_word &row, const std::vector<std::string> &words,
-                              size_t *inout_at, intercept_wish *inout) {
+std::string take_check(const intercept_word &row, const std::vector<std::string> &words, size_t *inout_at,
+                       intercept_wish *inout) {
     if (std::string wrong = take_one(row, words, inout_at, inout); !wrong.empty())
         return wrong;
     const std::string kind = inout->at(row.node).value_or("tcp");
@@ -84,6 +85,7 @@ static std::string take_check(const intercept_word &row, const std::vector<std::
     inout->emplace("check_argument", argument);
     return "";
 }
+} // namespace
 
 const std::vector<intercept_word> &intercept_words() {
     static const std::vector<intercept_word> words = {
@@ -109,14 +111,16 @@ const std::vector<intercept_word> &intercept_words() {
     return words;
 }
 
-static const char *fallback_of(const std::string &node) {
+namespace {
+const char *fallback_of(const std::string &node) {
     const schema_row *row = find_schema_row(parsed_name(NODE_INTERCEPT_CONFIG "/0/" + node));
     return row ? row->fallback : nullptr;
 }
+} // namespace
 
 const char *intercept_word_fallback(const intercept_word &word) {
     const char *fallback = fallback_of(word.node);
-    // Ports that are not given are none, which is no use.
+    // The default of ports is none: an intercept without ports is useless, and they have to be given.
     return std::string(word.node) == "ports" ? nullptr : fallback;
 }
 

@@ -1,5 +1,6 @@
-// A command looks at what is there, makes one commit, and asks whether there is a tunneld to follow it. What
-// is no use without a group that fits is noted, and done all the same: the group may come later.
+// A command reads the present configuration, makes one commit, and asks whether tunneld is running to follow
+// it. An intercept without a matching group is useless: it is made all the same, with a note, because the
+// group may be added later.
 #include "peers/mgmtctl/intercepts.h"
 
 #include <chrono>
@@ -16,7 +17,8 @@
 #include "peers/nodes/value_lists.h"
 #include "runtime/common.h"
 
-static traffic_result failed(traffic_result result, int exit, const std::string &error, uint32_t code = 0) {
+namespace {
+traffic_result with_failure(traffic_result result, int exit, const std::string &error, uint32_t code = 0) {
     result.exit = exit;
     result.error = error;
     result.code = code;
@@ -24,23 +26,25 @@ static traffic_result failed(traffic_result result, int exit, const std::string 
     return result;
 }
 
-static bool ask(const ctl_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
-                traffic_result *inout) {
+bool ask_mgmtd(const ctl_link &link, ctl_walk walk, const std::string &name, ctl_reply *out,
+               traffic_result *inout) {
     std::string reason;
     *out = {};
     if (!link.query(walk, name, out, &reason))
-        *inout = failed(*inout, CTL_UNREACHABLE, reason);
+        *inout = with_failure(*inout, CTL_UNREACHABLE, reason);
     else if (out->code != 0)
-        *inout = failed(*inout, CTL_REFUSED, out->message, out->code);
+        *inout = with_failure(*inout, CTL_REFUSED, out->message, out->code);
     return inout->exit == CTL_OK;
 }
+} // namespace
 
-// The node and what is below it, by the names below it, "" for the node itself.
+// The node and the nodes below it, by their names below it; "" is the node itself.
 using node_texts = std::map<std::string, std::string>;
-static bool read_nodes(const ctl_link &link, const std::string &root, node_texts *out,
-                       traffic_result *inout) {
+
+namespace {
+bool read_nodes(const ctl_link &link, const std::string &root, node_texts *out, traffic_result *inout) {
     ctl_reply reply;
-    if (!ask(link, ctl_walk::subtree, root, &reply, inout))
+    if (!ask_mgmtd(link, ctl_walk::subtree, root, &reply, inout))
         return false;
     for (const ctl_binding &binding : reply.bindings)
         if (binding.name == root || binding.name.starts_with(root + "/"))
@@ -48,15 +52,15 @@ static bool read_nodes(const ctl_link &link, const std::string &root, node_texts
     return true;
 }
 
-// Whether there is a tunneld to follow the change. One that has just been started gets time for its session.
-static void look_for_tunneld(const ctl_link &link, traffic_result *inout) {
+// Finds out whether tunneld is running. One that has just been started gets time to open its session.
+void look_for_tunneld(const ctl_link &link, traffic_result *inout) {
     using clock = std::chrono::steady_clock;
     const auto until = clock::now() + std::chrono::milliseconds(link.session_ms);
     for (;;) {
         ctl_reply reply;
         std::string reason;
         if (!link.query(ctl_walk::node, NODE_PLANE_STATE "/name", &reply, &reason))
-            return; // the change is made all the same
+            return; // the change has been made in any case
         inout->tunneld = reply.code == LC_IO_TIMED_OUT                   ? "silent"
                          : reply.code != LC_OK || reply.bindings.empty() ? "absent"
                                                                          : "running";
@@ -66,16 +70,16 @@ static void look_for_tunneld(const ctl_link &link, traffic_result *inout) {
     }
 }
 
-static void commit(const ctl_link &link, const std::vector<ctl_change_item> &items, const char *done,
-                   traffic_result *inout) {
+void commit_items(const ctl_link &link, const std::vector<ctl_change_item> &items, const char *done,
+                  traffic_result *inout) {
     ctl_reply reply;
     std::string reason;
     if (items.empty())
         inout->done = "unchanged";
     else if (!link.set(items, &reply, &reason))
-        *inout = failed(*inout, CTL_UNREACHABLE, reason);
+        *inout = with_failure(*inout, CTL_UNREACHABLE, reason);
     else if (reply.code != 0)
-        *inout = failed(*inout, CTL_REFUSED, reply.message, reply.code);
+        *inout = with_failure(*inout, CTL_REFUSED, reply.message, reply.code);
     else
         inout->done = done;
     if (inout->exit != CTL_OK)
@@ -83,16 +87,16 @@ static void commit(const ctl_link &link, const std::vector<ctl_change_item> &ite
     look_for_tunneld(link, inout);
 }
 
-static void remove_root(const ctl_link &link, const std::string &root, const char *done,
-                        const std::string &missing, traffic_result *inout) {
-    commit(link, {{ctl_change::remove, {root, "", ""}}}, done, inout);
+void delete_root(const ctl_link &link, const std::string &root, const char *done, const std::string &missing,
+                 traffic_result *inout) {
+    commit_items(link, {{ctl_change::remove, {root, "", ""}}}, done, inout);
     if (inout->code == LC_NOT_FOUND)
-        *inout = failed(*inout, CTL_NOT_FOUND, missing, inout->code);
+        *inout = with_failure(*inout, CTL_NOT_FOUND, missing, inout->code);
 }
 
-// Nodes of something that is new, or those of it that differ.
-static std::vector<ctl_change_item> changes(const std::string &root, const intercept_wish &wish,
-                                            const node_texts &before) {
+// The nodes that differ, or all of something new.
+std::vector<ctl_change_item> change_items(const std::string &root, const intercept_wish &wish,
+                                          const node_texts &before) {
     std::vector<ctl_change_item> items;
     if (before.empty())
         items.push_back({ctl_change::create, {root, "", ""}});
@@ -115,14 +119,13 @@ static std::vector<ctl_change_item> changes(const std::string &root, const inter
 
 // --- Intercepts
 
-static int protocol_number(const std::string &text) {
+int protocol_number(const std::string &text) {
     const bool digits = !text.empty() && text.size() < 4 && text.find_first_not_of("0123456789") == text.npos;
     return digits ? std::stoi(text) : ip_protocol_by_name(text.c_str());
 }
 
-// What mgmtd takes, and what is no use as the group is.
-static std::string what_does_not_fit(const ctl_link &link, const std::string &number,
-                                     const std::string &protocol) {
+// mgmtd accepts an intercept without a matching group, but it gets no packets.
+std::string misfit_note(const ctl_link &link, const std::string &number, const std::string &protocol) {
     traffic_result unused;
     node_texts group;
     if (!read_nodes(link, std::string(NODE_GROUP_CONFIG "/") + number, &group, &unused))
@@ -135,6 +138,7 @@ static std::string what_does_not_fit(const ctl_link &link, const std::string &nu
     return "group " + number + " redirects " + redirected + ", of which an intercept of " + protocol +
            " gets nothing";
 }
+} // namespace
 
 bool parse_group_number(const std::string &text, std::string *out) {
     if (text.empty() || text.size() > 6 || text.find_first_not_of("0123456789") != std::string::npos)
@@ -143,26 +147,29 @@ bool parse_group_number(const std::string &text, std::string *out) {
     return true;
 }
 
-static void set_intercept(const ctl_link &link, const std::string &root, bool fresh,
-                          const intercept_wish &wish, traffic_result *inout) {
+namespace {
+void set_intercept(const ctl_link &link, const std::string &root, bool fresh, const intercept_wish &wish,
+                   traffic_result *inout) {
     node_texts before;
     if (!read_nodes(link, root, &before, inout))
         return;
     if (fresh != before.empty()) {
-        *inout = fresh ? failed(*inout, CTL_REFUSED,
-                                "there is an intercept for group " + inout->subject +
-                                    "; \"mgmtctl intercept set\" changes it")
-                       : failed(*inout, CTL_NOT_FOUND, "there is no intercept for group " + inout->subject);
+        *inout =
+            fresh ? with_failure(*inout, CTL_REFUSED,
+                                 "there is an intercept for group " + inout->subject +
+                                     "; \"mgmtctl intercept set\" changes it")
+                  : with_failure(*inout, CTL_NOT_FOUND, "there is no intercept for group " + inout->subject);
         return;
     }
-    commit(link, changes(root, wish, before), fresh ? "added" : "changed", inout);
+    commit_items(link, change_items(root, wish, before), fresh ? "added" : "changed", inout);
     if (inout->exit != CTL_OK)
         return;
     std::string protocol = before.contains("protocol") ? before["protocol"] : "tcp";
     if (const auto wanted = wish.find("protocol"); wanted != wish.end())
         protocol = wanted->second.value_or("tcp");
-    inout->note = what_does_not_fit(link, inout->subject, protocol);
+    inout->note = misfit_note(link, inout->subject, protocol);
 }
+} // namespace
 
 traffic_result intercept_command(const ctl_link &link, const std::vector<std::string> &words) {
     static const char *const USAGE =
@@ -172,25 +179,25 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
     result.kind = "intercept";
     const std::string verb = words.empty() ? "" : words[0];
     if (verb != "add" && verb != "set" && verb != "delete")
-        return failed(result, CTL_USAGE,
-                      verb.empty() || verb == "show" || verb == "words"
-                          ? USAGE
-                          : unknown_word_text(verb, {"add", "set", "delete", "show", "words"}));
+        return with_failure(result, CTL_USAGE,
+                            verb.empty() || verb == "show" || verb == "words"
+                                ? USAGE
+                                : unknown_word_text(verb, {"add", "set", "delete", "show", "words"}));
     std::string number;
     if (words.size() < 2 || !parse_group_number(words[1], &number) ||
         (verb == "delete") != (words.size() == 2))
-        return failed(result, CTL_USAGE, USAGE);
+        return with_failure(result, CTL_USAGE, USAGE);
     result.subject = number;
     intercept_wish wish;
     if (const std::string wrong = parse_intercept_wish(words, &wish); !wrong.empty())
-        return failed(result, CTL_USAGE, wrong);
+        return with_failure(result, CTL_USAGE, wrong);
     if (verb == "add" && (!wish.contains("ports") || !wish.contains("to")))
-        return failed(result, CTL_USAGE,
-                      wish.contains("ports") ? "\"to\" is missing: the port that the proxy listens on"
-                                             : "\"port\" or \"all\" is missing: what the proxy wants");
+        return with_failure(result, CTL_USAGE,
+                            wish.contains("ports") ? "\"to\" is missing: the port that the proxy listens on"
+                                                   : "\"port\" or \"all\" is missing: what the proxy wants");
     const std::string root = NODE_INTERCEPT_CONFIG "/" + result.subject;
     if (verb == "delete")
-        remove_root(link, root, "deleted", "there is no intercept for group " + result.subject, &result);
+        delete_root(link, root, "deleted", "there is no intercept for group " + result.subject, &result);
     else
         set_intercept(link, root, verb == "add", wish, &result);
     return result;
@@ -198,9 +205,11 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
 
 // --- Bypasses
 
-static std::string instance_name(const char *above, const std::string &part) {
+namespace {
+std::string instance_name(const char *above, const std::string &part) {
     return parsed_name(above).below(part).text();
 }
+} // namespace
 
 traffic_result bypass_command(const ctl_link &link, const std::vector<std::string> &words, int64_t now) {
     static const char *const USAGE = "bypass add PREFIX [for SECONDS], bypass delete PREFIX, bypass show";
@@ -208,33 +217,33 @@ traffic_result bypass_command(const ctl_link &link, const std::vector<std::strin
     result.kind = "bypass";
     const std::string verb = words.empty() ? "" : words[0];
     if (verb != "add" && verb != "delete")
-        return failed(result, CTL_USAGE,
-                      verb.empty() || verb == "show" ? USAGE
-                                                     : unknown_word_text(verb, {"add", "delete", "show"}));
+        return with_failure(
+            result, CTL_USAGE,
+            verb.empty() || verb == "show" ? USAGE : unknown_word_text(verb, {"add", "delete", "show"}));
     if (words.size() != 2 && (verb == "delete" || words.size() != 4))
-        return failed(result, CTL_USAGE, USAGE);
+        return with_failure(result, CTL_USAGE, USAGE);
     result.subject = words[1].find('/') == std::string::npos ? words[1] + "/32" : words[1];
     if (const char *wrong = check_prefix(&result.subject))
-        return failed(result, CTL_USAGE, wrong); // after the kind and the subject
+        return with_failure(result, CTL_USAGE, wrong); // printed after the kind and the subject
     const std::string root = instance_name(NODE_BYPASS_CONFIG, result.subject);
     if (verb == "delete") {
-        remove_root(link, root, "deleted", "there is no such bypass", &result);
+        delete_root(link, root, "deleted", "there is no such bypass", &result);
         return result;
     }
     int64_t until = 0;
     if (words.size() == 4) {
         if (words[2] != "for")
-            return failed(result, CTL_USAGE, unknown_word_text(words[2], {"for"}));
+            return with_failure(result, CTL_USAGE, unknown_word_text(words[2], {"for"}));
         const int64_t seconds = number_of<int64_t>(words[3], 0);
         if (std::to_string(seconds) != words[3] || seconds < 1 || now + seconds > UINT32_MAX)
-            return failed(result, CTL_USAGE, "\"for\" needs a number of seconds");
+            return with_failure(result, CTL_USAGE, "\"for\" needs a number of seconds");
         until = now + seconds;
     }
     node_texts before;
     if (!read_nodes(link, root, &before, &result))
         return result;
-    commit(link, changes(root, {{"until", std::to_string(until)}}, before),
-           before.empty() ? "added" : "changed", &result);
+    commit_items(link, change_items(root, {{"until", std::to_string(until)}}, before),
+                 before.empty() ? "added" : "changed", &result);
     return result;
 }
 
@@ -247,28 +256,28 @@ traffic_result tunnel_command(const ctl_link &link, const std::vector<std::strin
     result.kind = "source";
     const std::string verb = words.empty() ? "" : words[0];
     if (verb != "accept" && verb != "refuse")
-        return failed(result, CTL_USAGE,
-                      verb.empty() || verb == "show" ? USAGE
-                                                     : unknown_word_text(verb, {"accept", "refuse", "show"}));
+        return with_failure(
+            result, CTL_USAGE,
+            verb.empty() || verb == "show" ? USAGE : unknown_word_text(verb, {"accept", "refuse", "show"}));
     if (words.size() != 2 && (verb == "refuse" || words.size() != 4))
-        return failed(result, CTL_USAGE, USAGE);
+        return with_failure(result, CTL_USAGE, USAGE);
     if (words.size() == 4 && words[2] != "router")
-        return failed(result, CTL_USAGE, unknown_word_text(words[2], {"router"}));
+        return with_failure(result, CTL_USAGE, unknown_word_text(words[2], {"router"}));
     std::string address = words[1];
     if (const char *wrong = check_host_address(&address))
-        return failed(result, CTL_USAGE, "\"" + words[1] + "\" " + wrong);
+        return with_failure(result, CTL_USAGE, "\"" + words[1] + "\" " + wrong);
     result.subject = address;
     const std::string root = instance_name(NODE_ACCEPT_CONFIG, address);
     if (verb == "refuse") {
-        remove_root(link, root, "refused", "is not accepted beside the routers", &result);
+        delete_root(link, root, "refused", "is not accepted beside the routers", &result);
         return result;
     }
     node_texts before;
     if (!read_nodes(link, root, &before, &result))
         return result;
     const std::optional<std::string> router = words.size() == 4 ? std::optional(words[3]) : std::nullopt;
-    commit(link, changes(root, {{"router", router}}, before), before.empty() ? "accepted" : "changed",
-           &result);
+    commit_items(link, change_items(root, {{"router", router}}, before),
+                 before.empty() ? "accepted" : "changed", &result);
     return result;
 }
 
@@ -278,18 +287,19 @@ traffic_result protection_command(const ctl_link &link, const std::vector<std::s
     traffic_result result;
     result.kind = "protection";
     if (words[0] != "time")
-        return failed(result, CTL_USAGE, unknown_word_text(words[0], {"time"}));
+        return with_failure(result, CTL_USAGE, unknown_word_text(words[0], {"time"}));
     const int64_t seconds = words.size() == 2 ? number_of<int64_t>(words[1], -1) : -1;
     if (seconds < 0 || std::to_string(seconds) != words[1])
-        return failed(result, CTL_USAGE, "protection [time SECONDS]; 0 switches it off");
+        return with_failure(result, CTL_USAGE, "protection [time SECONDS]; 0 switches it off");
     result.subject = "time";
     ctl_reply reply;
-    if (!ask(link, ctl_walk::node, NODE_PROTECTION_TIME, &reply, &result))
+    if (!ask_mgmtd(link, ctl_walk::node, NODE_PROTECTION_TIME, &reply, &result))
         return result;
     const bool same = !reply.bindings.empty() && reply.bindings[0].value == words[1];
-    commit(link,
-           same ? std::vector<ctl_change_item>{}
-                : std::vector<ctl_change_item>{{ctl_change::create, {NODE_PROTECTION_TIME, "", words[1]}}},
-           "changed", &result);
+    commit_items(
+        link,
+        same ? std::vector<ctl_change_item>{}
+             : std::vector<ctl_change_item>{{ctl_change::create, {NODE_PROTECTION_TIME, "", words[1]}}},
+        "changed", &result);
     return result;
 }

@@ -1,4 +1,4 @@
-// Changing what happens to redirected packets: intercepts, bypasses, and further sources of tunnels.
+// Changes of what happens to redirected packets: intercepts, bypasses, and further sources of tunnels.
 #pragma once
 
 #include <cstdint>
@@ -18,7 +18,7 @@ struct traffic_result {
     std::string tunneld; // "running", "absent", "silent"; empty where it was not asked
 };
 
-// "051" as "51". False for what is no number.
+// "051" as "51". False when it is not a number.
 bool parse_group_number(const std::string &text, std::string *out);
 // `words` follow "intercept", "bypass" and "tunnel". Each command is one commit.
 traffic_result intercept_command(const ctl_link &link, const std::vector<std::string> &words);
@@ -27,10 +27,10 @@ traffic_result bypass_command(const ctl_link &link, const std::vector<std::strin
 traffic_result tunnel_command(const ctl_link &link, const std::vector<std::string> &words);
 traffic_result protection_command(const ctl_link &link, const std::vector<std::string> &words); // not empty
 
-// `words` follow "drain"; it prints, and gives the exit code.
+// `words` follow "drain". Prints, and returns the exit code.
 int run_drain(const ctl_options &options, const ctl_link &link, const std::vector<std::string> &words);
 
-// What is configured and what tunneld answers, printed. They give the exit code.
+// Print what is configured and what tunneld answers. They return the exit code.
 int tell_intercepts(const ctl_options &options, const ctl_link &link, const std::string &only);
 int tell_bypasses(const ctl_options &options, const ctl_link &link);
 int tell_tunnels(const ctl_options &options, const ctl_link &link);

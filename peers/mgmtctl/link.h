@@ -1,4 +1,4 @@
-// What a command needs of a session, so that a test can give the answers.
+// The requests that a command makes, as functions, so that a test can answer them.
 #pragma once
 
 #include <functional>
@@ -23,6 +23,6 @@ struct ctl_link {
     int64_t session_ms = 3000; // how long tunneld may take to open its session
 };
 
-// A link whose session begins with its first request and ends with the last copy: wrong words are reported
-// without mgmtd as well.
+// A link that opens its session at the first request, so that a wrong command line is reported without mgmtd
+// as well, and closes it with the last copy of the link.
 ctl_link link_to_mgmtd(const ctl_options &options);

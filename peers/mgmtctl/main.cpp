@@ -1,10 +1,10 @@
-// mgmtctl: queries mgmtd, changes the configuration, watches. docs/mgmtctl.md has the commands and exit
-// codes.
+// mgmtctl: queries mgmtd, changes the configuration, watches. The commands and exit codes are in
+// docs/mgmtctl.md.
 //
-// The handlers of the signals that end a program only note the signal, because the session has to be closed
-// and its socket removed first. Then the program ends by the same signal, which the shell sees. SIGPIPE is
-// ignored because the loss of the session is reported; a pipe on standard output that nobody reads any more
-// is detected at the end, and ends the program as SIGPIPE would have.
+// The handlers of SIGINT, SIGTERM and SIGHUP only note the signal, because the session has to be closed
+// first. Then the program ends by the same signal, which the shell sees. SIGPIPE is ignored, because a lost
+// session is reported as an error; a pipe on standard output that nobody reads any more is detected at the
+// end, and ends the program as SIGPIPE would have.
 #include <algorithm>
 #include <cerrno>
 #include <csignal>
@@ -21,11 +21,12 @@
 
 // --- The end
 
-static void note_signal(int number) {
+namespace {
+void note_signal(int number) {
     ctl_stop_signal = number;
 }
 
-static void take_signals() {
+void take_signals() {
     struct sigaction action = {};
     action.sa_handler = note_signal; // without SA_RESTART: it ends a wait
     for (const int number : {SIGINT, SIGTERM, SIGHUP})
@@ -33,36 +34,36 @@ static void take_signals() {
     signal(SIGPIPE, SIG_IGN);
 }
 
-static void end_by(int number) {
+void end_by_signal(int number) {
     signal(number, SIG_DFL);
     raise(number);
 }
 
-static int finish(int code) {
+int finish_output(int code) {
     errno = 0;
     const bool written = fflush(stdout) == 0 && !ferror(stdout);
     const int error = errno;
     if (ctl_stop_signal && code != CTL_OK)
-        end_by(ctl_stop_signal);
+        end_by_signal(ctl_stop_signal);
     if (written || ctl_stop_signal)
         return code;
     pollfd out = {STDOUT_FILENO, 0, 0};
     if (error == EPIPE || (poll(&out, 1, 0) == 1 && (out.revents & POLLERR)))
-        end_by(SIGPIPE);
+        end_by_signal(SIGPIPE);
     fprintf(stderr, "mgmtctl: standard output: %s\n", error ? strerror(error) : "not all of it was written");
     return code == CTL_OK ? CTL_OUTPUT : code;
 }
 
 // --- The command line
 
-// Words that look like options or lists but are not (after "--", or in brackets) are shielded from the
-// parser, which would take them apart.
-static constexpr char SHIELD = '\1';
+// Words that look like options or lists but are not (after "--", or in brackets) are marked, because the
+// parser would take them apart.
+constexpr char SHIELD = '\1';
 
-static std::vector<std::string> shielded(int argc, char **argv) {
+std::vector<std::string> shield_words(int argc, char **argv) {
     std::vector<std::string> out;
     bool plain = false;
-    for (int i = argc - 1; i > 0; i--) // the parser takes them from the back
+    for (int i = argc - 1; i > 0; i--) // the parser expects them in reverse order
         out.emplace_back(argv[i]);
     for (auto word = out.rbegin(); word != out.rend(); ++word) {
         if (plain || word->starts_with('['))
@@ -73,7 +74,7 @@ static std::vector<std::string> shielded(int argc, char **argv) {
     return out;
 }
 
-static int usage_error(const CLI::App &app, const std::vector<std::string> &arguments, std::string error) {
+int usage_error(const CLI::App &app, const std::vector<std::string> &arguments, std::string error) {
     if (app.get_subcommands().empty()) {
         error = "a word is missing";
         for (auto word = arguments.rbegin(); word != arguments.rend(); ++word)
@@ -95,7 +96,6 @@ static int usage_error(const CLI::App &app, const std::vector<std::string> &argu
 
 // --- Commands
 
-namespace {
 struct command_line {
     CLI::App app{"Asks mgmtd for the state of the appliance, changes its configuration, watches it.",
                  "mgmtctl"};
@@ -112,16 +112,15 @@ struct command_line {
     uint32_t from = 0, to = 0; // commits
     ctl_notify_options notify;
 };
-} // namespace
 
-static CLI::App *add_command(command_line *line, const char *word, const char *about,
-                             std::function<int()> function) {
+CLI::App *add_command(command_line *line, const char *word, const char *about,
+                      std::function<int()> function) {
     CLI::App *command = line->app.add_subcommand(word, about);
     command->callback([line, function = std::move(function)] { line->run = function; });
     return command;
 }
 
-static void add_options(command_line *line) {
+void add_options(command_line *line) {
     line->app.set_version_flag("--version", std::string("mgmtctl ") + wccp_version());
     line->app.require_subcommand(1);
     line->app.fallthrough();
@@ -132,7 +131,7 @@ static void add_options(command_line *line) {
         ->capture_default_str();
 }
 
-static void add_node_commands(command_line *line) {
+void add_node_commands(command_line *line) {
     add_command(line, "get", "values of nodes", [line] { return ctl_get(line->options, line->words); })
         ->add_option("NAME", line->words)
         ->required();
@@ -157,7 +156,7 @@ static void add_node_commands(command_line *line) {
         ->required();
 }
 
-static void add_watch_commands(command_line *line) {
+void add_watch_commands(command_line *line) {
     CLI::App *command = add_command(line, "watch", "changes, alarms, roles and processes, as they come",
                                     [line] { return ctl_watch(line->options, line->words, line->count); });
     command->add_option("NAME", line->words, "changes of this and below it only; * is one part of a name");
@@ -167,7 +166,7 @@ static void add_watch_commands(command_line *line) {
     })->add_flag("--check", line->check, "exit with 6 when there are any");
 }
 
-static void add_group_commands(command_line *line) {
+void add_group_commands(command_line *line) {
     add_command(line, "group", "service groups: add, set, restart, delete, list, words", [line] {
         return ctl_group(line->options, line->words);
     })->add_option("WORD", line->words);
@@ -176,7 +175,7 @@ static void add_group_commands(command_line *line) {
     })->add_option("WORD", line->words);
 }
 
-static void add_traffic_commands(command_line *line) {
+void add_traffic_commands(command_line *line) {
     add_command(line, "intercept", "redirected packets to a proxy: add, set, delete, show, words", [line] {
         return ctl_intercept(line->options, line->words);
     })->add_option("WORD", line->words);
@@ -191,7 +190,7 @@ static void add_traffic_commands(command_line *line) {
     })->add_option("WORD", line->words);
 }
 
-static void add_config_commands(command_line *line) {
+void add_config_commands(command_line *line) {
     const CLI::Range commits(1u, UINT32_MAX);
     CLI::App *apply = add_command(line, "apply", "make FILE the configuration: one commit",
                                   [line] { return ctl_apply(line->options, line->name, line->apply); });
@@ -225,8 +224,8 @@ static void add_config_commands(command_line *line) {
         ->required();
 }
 
-// Of a command whose words begin with what to do, with that.
-static std::string cause_of(const command_line &line) {
+// The cause of a commit: the command, with its verb where it has one.
+std::string cause_of(const command_line &line) {
     const std::string word = line.app.get_subcommands().front()->get_name();
     for (const char *begins : {"group", "policy", "intercept", "bypass", "tunnel"})
         if (word == begins && !line.words.empty())
@@ -234,13 +233,13 @@ static std::string cause_of(const command_line &line) {
     return word;
 }
 
-static void add_drain_command(command_line *line) {
+void add_drain_command(command_line *line) {
     add_command(line, "drain", "empty groups before they leave: [GROUP] [for S] [wait], cancel, show",
                 [line] { return ctl_drain(line->options, line->words); })
         ->add_option("WORD", line->words);
 }
 
-static void add_show_command(command_line *line) {
+void add_show_command(command_line *line) {
     ctl_options *options = &line->options;
     CLI::App *command = add_command(line, "show", "the whole appliance in one screen",
                                     [options] { return ctl_show(*options); });
@@ -259,7 +258,7 @@ static void add_show_command(command_line *line) {
         "--no-colour", [options] { options->colour = 0; }, "without colour");
 }
 
-static void add_explain_command(command_line *line) {
+void add_explain_command(command_line *line) {
     CLI::App *command = add_command(line, "explain", "why a group does not work, and what to do", [line] {
         return line->list ? ctl_list_reasons(line->options) : ctl_explain(line->options, line->group);
     });
@@ -267,19 +266,19 @@ static void add_explain_command(command_line *line) {
     command->add_flag("--list", line->list, "every reason that there can be, as a table");
 }
 
-static void add_check_command(command_line *line) {
+void add_check_command(command_line *line) {
     add_command(line, "check", "what on this host is in the way, and how to fix it",
                 [line] { return ctl_check(line->options); });
 }
 
-static void add_metrics_command(command_line *line) {
+void add_metrics_command(command_line *line) {
     CLI::App *command = add_command(line, "metrics", "counters and states for a monitoring system",
                                     [line] { return ctl_metrics(line->options, line->text, line->http); });
     command->add_flag("--text", line->text, "in the older text format, for a textfile collector");
     command->add_flag("--http", line->http, "answer the HTTP request on standard input");
 }
 
-static void add_notify_command(command_line *line) {
+void add_notify_command(command_line *line) {
     CLI::App *command =
         add_command(line, "notify", "commands at changes of roles, alarms and proxies: run, list",
                     [line] { return ctl_notify(line->options, line->name, line->notify); });
@@ -293,17 +292,18 @@ static void add_notify_command(command_line *line) {
         ->capture_default_str();
 }
 
-static void add_shell_command(command_line *line) {
+void add_shell_command(command_line *line) {
     CLI::App *command = add_command(
         line, "complete", "", [line] { return ctl_complete(line->words.empty() ? "" : line->words[0]); });
     command->add_option("WORD", line->words);
     command->group(""); // not in the list of commands
 }
 
-static void unshield(std::string *word) {
+void unshield_word(std::string *word) {
     if (word->starts_with(SHIELD))
         word->erase(0, 1);
 }
+} // namespace
 
 // NOLINTNEXTLINE(bugprone-exception-escape): memory that runs out ends this program
 int main(int argc, char **argv) {
@@ -323,19 +323,19 @@ int main(int argc, char **argv) {
     add_shell_command(&line);
 
     take_signals();
-    const std::vector<std::string> arguments = shielded(argc, argv);
+    const std::vector<std::string> arguments = shield_words(argc, argv);
     try {
         std::vector<std::string> taken = arguments;
         line.app.parse(taken);
     } catch (const CLI::ParseError &error) {
         if (error.get_exit_code() == 0)
-            return line.app.exit(error) == 0 ? finish(CTL_OK) : CTL_USAGE; // --help
+            return line.app.exit(error) == 0 ? finish_output(CTL_OK) : CTL_USAGE; // --help
         return usage_error(line.app, arguments, error.what());
     }
     for (std::string &word : line.words)
-        unshield(&word);
-    unshield(&line.name);
+        unshield_word(&word);
+    unshield_word(&line.name);
     line.options.timeout_ms = static_cast<int64_t>(std::max(1.0, line.seconds * 1000)); // 1 also for "nan"
     line.options.cause = cause_of(line);
-    return finish(line.run());
+    return finish_output(line.run());
 }

@@ -2,9 +2,10 @@
 
 #include <algorithm>
 
-static constexpr size_t LETTERS_MAX = 64; // that are compared
+namespace {
+constexpr size_t LETTERS_MAX = 64; // that are compared
 
-static size_t edit_distance(const std::string &a, const std::string &b) {
+size_t edit_distance(const std::string &a, const std::string &b) {
     std::vector<size_t> row(b.size() + 1);
     for (size_t j = 0; j <= b.size(); j++)
         row[j] = j;
@@ -19,6 +20,7 @@ static size_t edit_distance(const std::string &a, const std::string &b) {
     }
     return row[b.size()];
 }
+} // namespace
 
 const std::string *nearest_word(const std::string &word, const std::vector<std::string> &known,
                                 size_t mistakes) {

@@ -1,4 +1,4 @@
-// The words of mgmtctl that name nodes: "get", "walk", "set", "delete", "alarms", and the shell's completion.
+// The commands about nodes: "get", "walk", "set", "delete", "alarms", and the shell's completion.
 #include <cstdio>
 
 #include <nlohmann/json.hpp>
@@ -13,12 +13,14 @@
 
 // --- get and walk
 
-static ctl_failure missing(connection *mgmtd, const std::string &text) {
+namespace {
+ctl_failure describe_missing(connection *mgmtd, const std::string &text) {
     node_name name;
     const schema_row *row = parse_node_name(text, &name) ? find_schema_row(name) : nullptr;
     return {CTL_NOT_FOUND, text, row && !row->instance ? "is not set" : "there is no such node",
             hint_for_missing(mgmtd->asking(), text), LC_NOT_FOUND};
 }
+} // namespace
 
 int ctl_get(const ctl_options &options, const std::vector<std::string> &names) {
     connection mgmtd(options);
@@ -39,7 +41,7 @@ int ctl_get(const ctl_options &options, const std::vector<std::string> &names) {
             continue;
         }
         const ctl_failure failure =
-            reply.code == 0 ? missing(&mgmtd, name)
+            reply.code == 0 ? describe_missing(&mgmtd, name)
                             : ctl_failure{exit_of(reply.code), name, reply.message, "", reply.code};
         nodes.push_back(json_failure(failure));
         if (!options.json)
@@ -56,7 +58,7 @@ int ctl_walk_nodes(const ctl_options &options, const std::string &name, ctl_walk
     if (!mgmtd.session)
         return mgmtd.code;
     std::vector<ctl_binding> found;
-    // The root of all names is no node, and neither is its walk a query.
+    // The root of all names is not a node, and mgmtd has no query for a walk of it.
     for (const std::string &root :
          name == "/" ? std::vector<std::string>{"/logging", "/qv"} : std::vector<std::string>{name}) {
         ctl_reply reply;
@@ -89,10 +91,11 @@ int ctl_walk_nodes(const ctl_options &options, const std::string &name, ctl_walk
 
 // --- set and delete
 
-static int refused_change(const ctl_options &options, connection *mgmtd, const ctl_reply &reply,
-                          const std::vector<ctl_change_item> &items) {
+namespace {
+int refused_change(const ctl_options &options, connection *mgmtd, const ctl_reply &reply,
+                   const std::vector<ctl_change_item> &items) {
     ctl_failure failure = {exit_of(reply.code), "", reply.message, "", reply.code};
-    // A refusal begins with the name of its node.
+    // The text of a refusal begins with the name of the node.
     for (const ctl_change_item &item : items)
         if (reply.message.starts_with(item.binding.name + ": "))
             failure.node = item.binding.name;
@@ -104,7 +107,7 @@ static int refused_change(const ctl_options &options, connection *mgmtd, const c
 }
 
 // One commit.
-static int change(const ctl_options &options, const std::vector<ctl_change_item> &items) {
+int commit_change(const ctl_options &options, const std::vector<ctl_change_item> &items) {
     connection mgmtd(options);
     if (!mgmtd.session)
         return mgmtd.code;
@@ -129,6 +132,7 @@ static int change(const ctl_options &options, const std::vector<ctl_change_item>
     put(json_line({{"changed", changed}, {"created", said.created}, {"notes", said.notes}, {"exit", 0}}));
     return CTL_OK;
 }
+} // namespace
 
 int ctl_change_nodes(const ctl_options &options, const std::vector<std::string> &words, bool existing) {
     std::vector<ctl_change_item> items;
@@ -136,7 +140,7 @@ int ctl_change_nodes(const ctl_options &options, const std::vector<std::string> 
         parse_assignments(words, existing ? ctl_change::modify : ctl_change::create, &items);
     if (!wrong.empty())
         return tell_failure(options, {CTL_USAGE, "", wrong, "", 0});
-    return change(options, items);
+    return commit_change(options, items);
 }
 
 int ctl_delete(const ctl_options &options, const std::vector<std::string> &names) {
@@ -144,13 +148,21 @@ int ctl_delete(const ctl_options &options, const std::vector<std::string> &names
     items.reserve(names.size());
     for (const std::string &name : names)
         items.push_back({ctl_change::remove, {name, "", ""}});
-    return change(options, items);
+    return commit_change(options, items);
 }
 
 // --- alarms and completion
 
-// What the alarms come from. A wccpd that is gone, or hangs, raises none: its absence is one.
-static bool explain_alarms(connection *mgmtd, std::vector<ctl_alarm> *inout, bool *out_known) {
+namespace {
+// Since when wccpd has been gone; empty: unknown.
+std::string absence_of(const snapshot &shown) {
+    const auto known = shown.processes.find("wccpd");
+    return known == shown.processes.end() || known->second.running ? "" : known->second.since;
+}
+
+// Adds the causes of the alarms of groups. A wccpd that is gone or hangs raises no alarms; this adds one for
+// it.
+bool explain_alarms(connection *mgmtd, std::vector<ctl_alarm> *inout, bool *out_known) {
     snapshot_limits limits;
     if (inout->empty())
         limits.queries = 0; // of groups
@@ -174,9 +186,11 @@ static bool explain_alarms(connection *mgmtd, std::vector<ctl_alarm> *inout, boo
     *out_known = shown.wccpd == wccpd_condition::running;
     for (const reason &each : reasons)
         if (each.code.starts_with("wccpd-"))
-            inout->push_back({"0", "wccpd", each.code, each.cause, "", "", each.code, each.cause});
+            inout->push_back(
+                {"0", "wccpd", each.code, each.cause, absence_of(shown), "", each.code, each.cause});
     return shown.unreachable.empty();
 }
+} // namespace
 
 int ctl_alarms(const ctl_options &options, bool check) {
     connection mgmtd(options);
@@ -197,7 +211,7 @@ int ctl_alarms(const ctl_options &options, bool check) {
     return check && !standing.empty() ? CTL_STANDING : CTL_OK;
 }
 
-// Says nothing but what fits, whatever is wrong: it is asked while somebody types.
+// Prints nothing but completions, whatever fails: the shell calls it while somebody types.
 int ctl_complete(const std::string &word) {
     std::string reason;
     const ctl_held_session session(ctl_open(1000, &reason));

@@ -1,11 +1,11 @@
-// Names as a person types them: completed, corrected, and judged by what a change of the node means.
+// Names as a person types them: their completion, their correction, and what a change of the node means.
 //
-// The schema lists the names that can exist, without mgmtd; mgmtd is queried only where a part of a name is
-// somebody's choice (a group's number, a file). The upper parts therefore complete at once, and completion
+// The schema lists the names that can exist, without mgmtd. mgmtd is queried only where a part of a name can
+// be chosen freely (a group's number, a file). The upper parts therefore complete at once, and completion
 // stays fast with hundreds of groups.
 //
-// wccpd takes some changes of a running group only with the group as a whole. The commit is made as it was
-// asked for, and a note says which groups were deleted and created again for it.
+// Some changes of a running group make wccpd delete the group and create it again. The commit is made as it
+// was asked for, and a note names these groups.
 #include "peers/mgmtctl/nodes.h"
 
 #include <algorithm>
@@ -17,8 +17,9 @@
 #include "peers/mgmtctl/nearest_word.h"
 #include "runtime/common.h"
 
+namespace {
 // The root of the service group that a configuration node belongs to, "" for others.
-static std::string group_of(const std::string &text) {
+std::string group_of(const std::string &text) {
     static const node_name groups = parsed_name(NODE_GROUP_CONFIG);
     node_name name = parsed_name(text);
     if (!name.is_under(groups))
@@ -27,13 +28,13 @@ static std::string group_of(const std::string &text) {
     return name.text();
 }
 
-static std::string number_of(const std::string &root) {
+std::string number_of(const std::string &root) {
     return root.substr(root.rfind('/') + 1);
 }
 
-// --- Names that there can be
+// --- Names that can exist
 
-static const std::vector<node_name> &patterns() {
+const std::vector<node_name> &known_patterns() {
     static const std::vector<node_name> all = [] {
         std::vector<node_name> made;
         made.reserve(schema().size() + wccpd_state_nodes().size() + tunneld_state_nodes().size());
@@ -52,13 +53,13 @@ static const std::vector<node_name> &patterns() {
     return all;
 }
 
-// The parts that can follow a name: fixed ones of the schema and of the states, and those that there are
-// where the name's next part is somebody's choice. Sorted.
-static std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above) {
+// The parts that can follow a name: fixed ones of the schema and of the states, and existing ones where the
+// next part can be chosen freely. Sorted.
+std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above) {
     std::set<std::string> found;
     const size_t depth = above.parts.size();
     bool choice = false;
-    for (node_name pattern : patterns()) {
+    for (node_name pattern : known_patterns()) {
         if (pattern.parts.size() <= depth)
             continue;
         const std::string next = pattern.parts[depth];
@@ -70,7 +71,7 @@ static std::vector<std::string> names_below(const ctl_ask &ask, const node_name 
         else
             found.insert(next);
     }
-    // The children alone where they are nodes, else whatever is below.
+    // Only the children where these are nodes, otherwise everything below.
     for (const ctl_walk walk : {ctl_walk::children, ctl_walk::subtree}) {
         ctl_reply reply;
         if (!choice || !ask(walk, above.text(), &reply))
@@ -87,6 +88,7 @@ static std::vector<std::string> names_below(const ctl_ask &ask, const node_name 
     });
     return out;
 }
+} // namespace
 
 // --- Names that were meant
 
@@ -106,7 +108,7 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
         return "it has no value of its own; \"mgmtctl walk " + text + "\" lists what is below";
     if (const schema_row *row = find_schema_row(name))
         return row->instance ? "" : "it can be set, and has no default";
-    // From the top down to the first part that can't be.
+    // From the top down to the first part that cannot exist.
     node_name good;
     for (const std::string &part : name.parts) {
         const std::vector<std::string> known = names_below(ask, good);
@@ -122,13 +124,15 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
     return "";
 }
 
-static bool is_state(const node_name &name) {
+namespace {
+bool is_state(const node_name &name) {
     for (const char *root : {NODE_WCCPD_STATE, NODE_GROUP_STATE, NODE_PLANE_STATE, NODE_TUNNEL_STATE,
                              NODE_INTERCEPT_STATE, NODE_ALARM_STATE, NODE_CONFIG_STATE})
         if (name == parsed_name(root) || name.is_under(parsed_name(root)))
             return true;
     return false;
 }
+} // namespace
 
 std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &text) {
     node_name name;
@@ -141,7 +145,8 @@ std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &text) {
 
 // --- Completion
 
-static std::vector<std::string> value_completions(const std::string &name_text, const std::string &begin) {
+namespace {
+std::vector<std::string> value_completions(const std::string &name_text, const std::string &begin) {
     const schema_row *row = find_schema_row(parsed_name(name_text));
     std::string words = row && row->words ? row->words : row && row->type == bn_type_bool ? "true|false" : "";
     std::vector<std::string> out;
@@ -153,6 +158,7 @@ static std::vector<std::string> value_completions(const std::string &name_text, 
     }
     return out;
 }
+} // namespace
 
 std::vector<std::string> completions(const ctl_ask &ask, const std::string &word) {
     if (const size_t equals = word.find('='); equals != std::string::npos)
@@ -189,7 +195,7 @@ bool query_walk(const ctl_ask &ask, ctl_walk how, const node_name &root, ctl_rep
         if (!query_walk(ask, how, root.below(part), &piece))
             return false;
         if ((piece.code == LC_IO_CLOSED || piece.code == LC_IO_TIMED_OUT) && !is_state(root))
-            continue; // a walk from above the states goes without them
+            continue; // a walk that begins above the states leaves them out
         if (piece.code != LC_OK) {
             *out = piece;
             return true;
@@ -222,7 +228,7 @@ bool add_appliances(const ctl_ask &ask, const std::string &root_text, std::vecto
     for (const ctl_binding &binding : *inout)
         if (matches(counts, parsed_name(binding.name)))
             counted.push_back(binding);
-    // A walk from the list itself down has no count in it.
+    // A walk that begins at the list itself does not contain the count.
     if (matches(list, root)) {
         node_name count = root;
         count.parts.back() = counts.parts.back();
@@ -285,33 +291,42 @@ bool look_before(const ctl_ask &ask, const std::vector<ctl_change_item> &items, 
     return true;
 }
 
-static const ctl_binding *find_binding(const std::vector<ctl_binding> &bindings, const std::string &name) {
+namespace {
+const ctl_binding *find_binding(const std::vector<ctl_binding> &bindings, const std::string &name) {
     for (const ctl_binding &binding : bindings)
         if (binding.name == name)
             return &binding;
     return nullptr;
 }
 
-// The part of the name after its group when wccpd takes a change of the node only with the whole group.
-static std::string whole_word(const std::string &name, const std::string &root) {
+// The part of the name after its group when a running group takes changes of that node in this way, else "".
+std::string changed_word(const std::string &name, const std::string &root, group_change change) {
     const std::string rest = name.size() > root.size() ? name.substr(root.size() + 1) : "";
     for (const group_word &word : group_words())
-        if (word.whole && rest.substr(0, rest.find('/')) == word.node)
+        if (word.change == change && rest.substr(0, rest.find('/')) == word.node)
             return word.node;
     return "";
 }
+} // namespace
 
-static std::string joined(const std::set<std::string> &words) {
+std::string at_start_note(const std::string &words, const std::string &group) {
+    return "a group that runs follows a change of " + words +
+           " when it is started again: mgmtctl group restart " + group;
+}
+
+namespace {
+std::string join_words(const std::set<std::string> &words) {
     std::string out;
     for (const std::string &word : words)
         out += (out.empty() ? "" : ", ") + word;
     return out;
 }
+} // namespace
 
 change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_before &before) {
     change_notes out;
-    std::set<std::string> ended;                        // roots
-    std::map<std::string, std::set<std::string>> whole; // words by root
+    std::set<std::string> ended;                                  // roots
+    std::map<std::string, std::set<std::string>> whole, at_start; // words by root
     for (const ctl_change_item &item : items) {
         const std::string &name = item.binding.name;
         const std::string root = group_of(name);
@@ -333,13 +348,21 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
                                                          : "";
         if (removed && old && row && !row->fallback)
             whole[root].insert(name.substr(root.size() + 1));
-        else if (const std::string word = whole_word(name, root);
-                 !word.empty() && (!old || old->value != after))
-            whole[root].insert(word);
+        else if (!old || old->value != after)
+            for (auto *words : {&whole, &at_start})
+                if (const std::string word = changed_word(
+                        name, root, words == &whole ? group_change::as_whole : group_change::at_start);
+                    !word.empty())
+                    (*words)[root].insert(word);
     }
     for (const auto &[root, words] : whole)
         if (!ended.contains(root))
-            out.notes.push_back("group " + number_of(root) + ": wccpd takes a change of " + joined(words) +
+            out.notes.push_back("group " + number_of(root) + ": wccpd takes a change of " +
+                                join_words(words) +
                                 " only with the group as a whole, which is deleted and created again for it");
+    for (const auto &[root, words] : at_start)
+        if (!ended.contains(root) && !whole.contains(root))
+            out.notes.push_back("group " + number_of(root) + ": " +
+                                at_start_note(join_words(words), number_of(root)));
     return out;
 }

@@ -1,11 +1,12 @@
-// The table of reasons, and those that follow from the state of a group.
+// The table of reasons, and the reasons that follow from the state of a group.
 //
-// wccpd's own reasons are taken as they are: it forgets what no longer holds. From the state comes what
-// nobody had to refuse: a router that does not answer, a table that is still to come, buckets that others
-// have. Such a reason is left out where a reason of wccpd explains it.
+// wccpd's own reasons are taken as they are: it removes those that have ended. Other reasons follow from the
+// state, where nothing was refused: a router does not answer, a table has not arrived yet, other appliances
+// have the buckets. They are left out where one of wccpd's reasons explains the state.
 #include "peers/mgmtctl/reasons.h"
 
 #include <algorithm>
+#include <functional>
 #include <map>
 
 #include "peers/mgmtctl/show_draw.h"
@@ -14,24 +15,25 @@ const std::vector<reason_text> &reason_texts() {
     static const std::vector<reason_text> texts = {
         // The programs.
         {"mgmtd-unreachable", true, "mgmtd does not answer: {offered}", "start mgmtd, or look at its log"},
-        {"wccpd-absent", true, "wccpd is not running: no group takes part",
+        {"wccpd-absent", true, "wccpd is not running: the appliance is in no group",
          "start wccpd; its log says why it ended"},
-        {"wccpd-silent", true, "wccpd does not answer: nothing is known of the groups",
-         "look at its log; when it stays so, restart it"},
-        {"tunneld-absent", true, "tunneld has no session: no tunnels, no traffic",
+        {"wccpd-silent", true, "wccpd does not answer: the state of the groups is unknown",
+         "look at its log; if this lasts, restart it"},
+        {"tunneld-absent", true, "tunneld has no session with mgmtd: no tunnels, no traffic",
          "start tunneld; its log says why it ended"},
-        {"tunneld-silent", true, "tunneld does not answer", "look at its log; when it stays so, restart it"},
+        {"tunneld-silent", true, "tunneld does not answer", "look at its log; if this lasts, restart it"},
         {"restart-loop", true, "{who} ends again and again: {offered}",
-         "its log says why it ends; the alarm is cleared once it has run for 5 minutes"},
+         "its log says why it ends (journalctl -u {who}); the alarm is cleared once it has run for 5 "
+         "minutes"},
         // A group that cannot begin.
         {"disabled", false, "the group is disabled", "mgmtctl group set {group} admin up"},
         {"no-interface", true, "the group has no interface", "mgmtctl group set {group} interface NAME"},
         {"no-router", true, "the group has no router", "mgmtctl group set {group} router ADDRESS"},
-        {"not-taken", true, "wccpd has not taken the group over",
+        {"not-taken", true, "wccpd does not have the group",
          "its log says why; then mgmtctl group "
          "restart {group}"},
-        {"not-configured", true, "wccpd runs the group, which is not configured",
-         "restart wccpd; when it comes back, report it"},
+        {"not-configured", true, "wccpd runs the group although it is not configured",
+         "restart wccpd; if the group comes back, report it"},
         {"left", true, "the group has left its routers: {offered}",
          "mgmtctl intercept show {group}; the group returns with its proxy"},
         {"drain", true, "the group is drained", "mgmtctl drain cancel {group} ends it"},
@@ -53,7 +55,7 @@ const std::vector<reason_text> &reason_texts() {
         {"no-memory", true, "wccpd has no memory for {offered} ({who})",
          "give it more (limit of locked memory, mem.conf)"},
         // A router whose messages are refused.
-        {"security-missing", true, "{who} signs no message, but the group has a password",
+        {"security-missing", true, "{who} does not sign its messages, but the group has a password",
          "set the password on the router, or mgmtctl group set {group} password default"},
         {"security-unwanted", true, "{who} signs its messages ({offered}), but the group has no password",
          "mgmtctl group set {group} password -, as on the router"},
@@ -61,81 +63,80 @@ const std::vector<reason_text> &reason_texts() {
          "set the same one on both: mgmtctl group set {group} password -"},
         {"message-version", true, "{who} speaks version {offered} of the protocol, not {wanted}",
          "set the router to version 2"},
-        {"view-length", true, "the view of {who} has {offered}, by its content {wanted}",
-         "mgmtctl group set {group} compatibility ios or nexus, as the router is"},
-        {"message-length", true, "a message of {who} has {offered}, but {wanted}",
+        {"view-length", true, "the view of {who} has {offered}, but its content needs {wanted}",
+         "set the router's kind: mgmtctl group set {group} compatibility ios or nexus"},
+        {"message-length", true, "a message from {who} has {offered}, but {wanted}",
          "look for a path that cuts packets (MTU, firewall)"},
-        {"message-malformed", true, "a message of {who} has {offered}; expected: {wanted}",
+        {"message-malformed", true, "a message from {who} has {offered}; expected: {wanted}",
          "capture it (udp port 2048); the router or the path breaks it"},
-        {"message-type", false, "{who} sends {offered}, which no appliance expects",
+        {"message-type", false, "{who} sends messages of {offered}, which are not for an appliance",
          "it is probably another appliance: give it the routers' addresses"},
-        {"router-id-zero", true, "a router calls itself 0.0.0.0",
-         "give the router an id or a loopback address"},
+        {"router-id-zero", true, "{who} calls itself 0.0.0.0", "give the router an id or a loopback address"},
         {"routers-exhausted", true, "{who} is one router too many; {wanted}",
-         "spread the routers over groups"},
-        {"forwarding-not-offered", true, "{who} offers forwarding by {offered}, wanted is {wanted}",
+         "spread the routers over several groups"},
+        {"forwarding-not-offered", true, "{who} offers forwarding by {offered}, but {wanted} is wanted",
          "mgmtctl group set {group} encap either, or change the router or the first router's method"},
-        {"assignment-not-offered", true, "{who} offers assignment by {offered}, wanted is {wanted}",
+        {"assignment-not-offered", true, "{who} offers assignment by {offered}, but {wanted} is wanted",
          "mgmtctl group set {group} assign either, or change the router or the first router's method"},
-        {"return-not-offered", true, "{who} offers return by {offered}, wanted is {wanted}",
+        {"return-not-offered", true, "{who} offers return by {offered}, but {wanted} is wanted",
          "let the router offer {wanted}"},
-        {"service-mismatch", true, "{who} has the service with {offered}; here it is {wanted}",
+        {"service-mismatch", true, "{who} defines the service with {offered}; here it has {wanted}",
          "make them equal: mgmtctl group set {group} priority, protocol, hash-..., or on the router"},
         {"group-unknown", true, "{who} asks for {offered}, which is not configured here",
-         "mgmtctl group add, or take this appliance's address off that group on the router"},
+         "add it (mgmtctl group add), or remove this appliance from it on the router"},
         {"group-disabled", false, "{who} still sends to the group, which is disabled",
          "nothing, or mgmtctl group set {group} admin up"},
-        {"group-stopped", false, "{who} sends while the group cannot run",
+        {"group-stopped", false, "{who} sends messages while the group cannot run",
          "see the other reasons of the group"},
         {"query-refused", false, "{who} sent {offered}",
          "nothing, unless it goes on; then restart the group"},
         // Tunnels.
-        {"mailbox-missing", true, "wccpd has no mailbox to tunneld, so {who} gets no tunnel",
+        {"mailbox-missing", true, "wccpd has no mailbox to tunneld: {who} gets no tunnel",
          "another wccpd owns it: stop that one, then restart wccpd"},
-        {"tunnel-timeout", true, "tunneld did not answer in 2 s, so {who} gets no tunnel",
+        {"tunnel-timeout", true, "tunneld did not answer in 2 s: {who} gets no tunnel",
          "look at tunneld's log; wccpd tries again with each message"},
         {"tunnel-refused", true, "tunneld refuses the tunnel to {who} ({offered} {wanted})",
          "its log says why; mgmtctl tunnel show"},
-        {"tunnel-ids-exhausted", true, "all tunnel ids are used ({wanted}), so {who} gets no tunnel",
+        {"tunnel-ids-exhausted", true, "all tunnel ids ({wanted}) are in use: {who} gets no tunnel",
          "let fewer routers forward or return by GRE"},
-        // Who hears whom.
+        // Routers and appliances that do not see each other.
+        {"method-differs", true, "assignment is {offered}, but {wanted} here",
+         "set the same assignment on all appliances (group set {group} assign), then group restart {group}"},
         {"not-in-view", true,
          "{who} answers, but does not list this appliance (it lists {offered}, not {wanted})",
          "wait 20 s; then check the router's list of appliances and its redirect ACL"},
         {"router-silent", true, "{who} has stopped answering: no I-See-You for 40 s",
-         "check the router and the path to it"},
+         "check the router, its password for the group, and the path to it"},
         {"no-answer", true, "{who} does not answer ({offered})",
-         "check address, service group, password and path (UDP 2048) on the router"},
+         "wait 20 s; then check address, service group, password and path (UDP 2048) on the router"},
         {"election-blocked", true,
-         "no appliance can be designated: a router lists {who}, which is here: {offered}",
-         "add {who} to the group (mgmtctl group set {group} router ...), or free it of the group"},
+         "no appliance can be designated: the routers list {who}, which is not two-way here: {offered}",
+         "add {who} to the group (mgmtctl group set {group} router ...), or remove it on the routers"},
         // The table.
-        {"method-differs", true, "assignment is {offered}, here it is by {wanted}",
-         "set the same assignment on all appliances (group set {group} assign), then group restart {group}"},
-        {"mask-differs", true, "{who} uses the mask {offered}, here it is {wanted}",
+        {"mask-differs", true, "{who} uses the mask {offered}; here it is {wanted}",
          "set the same mask on all appliances"},
-        {"appliance-left-out", true, "{who} gets no share: it is {offered}, not {wanted}",
+        {"appliance-left-out", true, "{who} gets no share: {offered} of {wanted} routers list it",
          "let all routers list {who}"},
         {"table-not-built", true, "no table can be built: {offered}", "mgmtctl group restart {group}"},
         {"not-acknowledged", true, "{who} has not acknowledged the table ({offered}, wanted {wanted})",
          "wait 20 s; then look at the router's log for refused assignments"},
-        {"assignment-differs", true, "{who} assigns {offered}, wanted is {wanted}",
-         "compare the routers: mgmtctl show; a router with another table needs a new one"},
+        {"assignment-differs", true, "{who} assigns {offered}; wanted: {wanted}",
+         "compare the routers' tables: mgmtctl show; mgmtctl group restart {group} makes a new one"},
         {"assignment-unreadable", true, "the assignment of {who} cannot be read",
-         "mgmtctl group set {group} compatibility ios or nexus, as the router is"},
+         "set the router's kind: mgmtctl group set {group} compatibility ios or nexus"},
         {"waiting-assignment", true, "the routers answer; no table is in force yet ({offered})",
          "wait: the designated appliance sends it 16 s after the last change"},
         {"restart-needed", true, "the group runs with {offered}, but is configured with {wanted}",
          "mgmtctl group restart {group}"},
-        {"weight-zero", false, "the routers redirect elsewhere, for this appliance's weight is 0 ({offered})",
+        {"weight-zero", false, "this appliance has the weight 0: the routers redirect to {offered}",
          "mgmtctl group set {group} weight N"},
-        {"redirected-elsewhere", true, "the routers redirect to others: {offered}",
+        {"redirected-elsewhere", true, "this appliance gets nothing: the routers redirect to {offered}",
          "check that the designated appliance lists this one and gives it a weight"},
         {"not-designated", false, "{who} is designated: it has the lowest address and makes the table",
          "nothing; look there for what is wrong with the table"},
         // Traffic.
         {"lack", true, "all packets are returned: the kernel lacks what sorts them",
-         "mgmtctl tunnel show; load the kernel's modules, or use --plane user"},
+         "load the kernel's modules, or use --plane user; then restart tunneld"},
         {"failure", true, "the kernel is not as wanted: something in it could not be changed",
          "tunneld tries again; its log has the details"},
         {"proxy-down", true, "the proxy is down; the last check says why",
@@ -148,8 +149,8 @@ const std::vector<reason_text> &reason_texts() {
          "nothing while it is a backup; mgmtctl explain {group} has what it waits for"},
         {"own-traffic", true, "the router redirects this appliance's own traffic",
          "exclude this appliance's addresses from redirection on the router"},
-        {"refused-source", true, "GRE comes from an address that is no router of ours",
-         "accept it when it is the router's: mgmtctl tunnel accept ADDRESS"},
+        {"refused-source", true, "GRE comes from {who}, which is no router of ours",
+         "accept it when it is the router's: mgmtctl tunnel accept {who}"},
         {"fragments", true, "packets come in fragments, and the MSS of no flow has been clamped",
          "raise the MTU towards the routers, or let the MSS be clamped"},
         {"no-intercept", true, "the routers redirect, but no intercept takes the packets: all are returned",
@@ -160,19 +161,22 @@ const std::vector<reason_text> &reason_texts() {
     return texts;
 }
 
-static size_t place_of(const std::string &code) {
+namespace {
+size_t place_of(const std::string &code) {
     const std::vector<reason_text> &texts = reason_texts();
     const auto found =
         std::find_if(texts.begin(), texts.end(), [&](const reason_text &row) { return code == row.code; });
     return static_cast<size_t>(found - texts.begin());
 }
+} // namespace
 
 const reason_text *find_reason_text(const std::string &code) {
     const size_t place = place_of(code);
     return place < reason_texts().size() ? &reason_texts()[place] : nullptr;
 }
 
-static std::string filled(std::string text, const reason &from) {
+namespace {
+std::string fill_placeholders(std::string text, const reason &from) {
     const std::pair<const char *, std::string> values[] = {
         {"{who}", from.who.empty() ? "somebody" : from.who},
         {"{offered}", from.offered.empty() ? "nothing" : from.offered},
@@ -184,32 +188,33 @@ static std::string filled(std::string text, const reason &from) {
             text.replace(at, std::string(name).size(), value);
     return text;
 }
+} // namespace
 
 void fill_reason(const std::vector<reason_text> &texts, reason *inout) {
     const auto found = std::find_if(texts.begin(), texts.end(),
                                     [&](const reason_text &row) { return inout->code == row.code; });
     const reason_text *text = found != texts.end() ? &*found : find_reason_text(inout->code);
     if (inout->cause.empty())
-        inout->cause = text ? filled(text->cause, *inout)
+        inout->cause = text ? fill_placeholders(text->cause, *inout)
                             : inout->code + (inout->who.empty() ? "" : " of " + inout->who);
-    inout->next = filled(text ? text->next : "look at the log of wccpd and tunneld", *inout);
-    inout->attention = !text || text->attention;
+    inout->next = fill_placeholders(text ? text->next : "look at the log of wccpd and tunneld", *inout);
+    inout->attention = (!text || text->attention) && !inout->harmless;
 }
 
-// --- Of the state
+// --- Reasons that follow from the state
 
 namespace {
 struct reason_list {
     std::vector<reason> reasons;
 
-    reason *add(const char *code, int group) {
+    reason *add_reason(const char *code, int group) {
         reasons.emplace_back().code = code;
         reasons.back().group = group;
         return &reasons.back();
     }
     void add_state(const char *code, const snapshot_group &group, const std::string &who,
                    const std::string &offered, const std::string &wanted = "") {
-        reason *made = add(code, group.id);
+        reason *made = add_reason(code, group.id);
         made->who = who;
         made->offered = offered;
         made->wanted = wanted;
@@ -217,38 +222,82 @@ struct reason_list {
             made->first_ms = static_cast<int64_t>(group.uptime_ms ? group.uptime_ms : group.since_ms);
     }
 };
-} // namespace
 
-static bool has_reason(const snapshot_group &group, std::initializer_list<const char *> codes,
-                       const std::string &who = "") {
+bool has_reason(const snapshot_group &group, std::initializer_list<const char *> codes,
+                const std::string &who = "") {
     return std::any_of(group.reasons.begin(), group.reasons.end(), [&](const snapshot_reason &each) {
         return (who.empty() || each.sender == who) &&
                std::any_of(codes.begin(), codes.end(), [&](const char *code) { return each.code == code; });
     });
 }
 
-static void add_noted(const std::vector<snapshot_reason> &noted, int group, reason_list *list) {
+bool is_about(const snapshot_reason &reason, const snapshot_router &router) {
+    return (!reason.sender.empty() && (reason.sender == router.address || reason.sender == router.id)) ||
+           reason.source == router.address;
+}
+
+// The latest of them.
+const snapshot_reason *last_reason(const std::vector<snapshot_reason> &reasons,
+                                   const std::function<bool(const snapshot_reason &)> &wanted) {
+    const snapshot_reason *found = nullptr;
+    for (const snapshot_reason &each : reasons)
+        if (wanted(each) && (!found || each.last_ms < found->last_ms))
+            found = &each;
+    return found;
+}
+} // namespace
+
+const snapshot_reason *router_reason(const snapshot &shown, const snapshot_group &group,
+                                     const snapshot_router &router) {
+    const snapshot_reason *of_group =
+        last_reason(group.reasons, [&](const snapshot_reason &each) { return is_about(each, router); });
+    // A packet that is refused before its group is known may have been for any group of its sender. One for a
+    // group that is not configured may have been meant for a group that hears nothing.
+    const snapshot_reason *of_none = last_reason(shown.reasons, [&](const snapshot_reason &each) {
+        return is_about(each, router) && (each.code.starts_with("message-") ||
+                                          (each.code == "group-unknown" && router.connection == "none"));
+    });
+    return !of_none || (of_group && of_group->last_ms <= of_none->last_ms) ? of_group : of_none;
+}
+
+namespace {
+// Reasons that are states: they last until they end, and their count means nothing.
+bool is_lasting(const std::string &code) {
+    static const char *const codes[] = {"interface-missing", "interface-down",     "interface-no-address",
+                                        "port-taken",        "socket-failed",      "join-failed",
+                                        "router-silent",     "election-blocked",   "assignment-differs",
+                                        "not-acknowledged",  "appliance-left-out", "mailbox-missing"};
+    return std::any_of(std::begin(codes), std::end(codes), [&](const char *each) { return code == each; });
+}
+
+void add_noted(const std::vector<snapshot_reason> &noted, int group, reason_list *list) {
+    const auto is_unlisted = [&](const std::string &router) {
+        return std::any_of(noted.begin(), noted.end(), [&](const snapshot_reason &each) {
+            return each.code == "not-in-view" && each.sender == router;
+        });
+    };
     for (const snapshot_reason &each : noted) {
         if (each.code == "interface-missing" && each.wanted.empty())
-            continue; // it has none: that is a reason of its own
-        reason *made = list->add(each.code.c_str(), group);
-        made->who = each.sender;
+            continue; // the group has no interface: "no-interface" says so
+        if (each.code == "election-blocked" && is_unlisted(each.sender))
+            continue; // follows from "not-in-view"
+        reason *made = list->add_reason(each.code.c_str(), group);
+        made->who = each.sender.empty() ? each.source : each.sender;
         made->offered = each.offered;
         made->wanted = each.wanted;
         made->count = each.count;
+        made->lasts = is_lasting(each.code);
         made->first_ms = each.first_ms;
         made->last_ms = each.last_ms;
     }
 }
 
-static void unheard_routers(const snapshot_group &group, reason_list *list) {
+void add_unheard_routers(const snapshot &shown, const snapshot_group &group, reason_list *list) {
     if (has_reason(group, {"interface-missing", "interface-down", "interface-no-address", "port-taken",
                            "socket-failed", "join-failed"}))
         return;
     for (const snapshot_router &router : group.routers) {
-        const bool explained = std::any_of(group.reasons.begin(), group.reasons.end(),
-                                           [&](const auto &each) { return each.sender == router.address; });
-        if (router.connection != "none" || explained)
+        if (router.connection != "none" || router_reason(shown, group, router))
             continue;
         list->add_state("no-answer", group, router.address,
                         std::to_string(group.here_i_ams) + " Here-I-Am sent");
@@ -256,11 +305,11 @@ static void unheard_routers(const snapshot_group &group, reason_list *list) {
     }
 }
 
-static std::string lowest_appliance(const snapshot_group &group) {
-    return group.appliances.empty() ? "" : group.appliances.front().address; // they are sorted
+std::string lowest_appliance(const snapshot_group &group) {
+    return group.appliances.empty() ? "" : group.appliances.front().address; // sorted by address
 }
 
-static void group_without_traffic(const snapshot_group &group, reason_list *list) {
+void add_missing_traffic(const snapshot_group &group, reason_list *list) {
     const bool two_way = std::any_of(group.routers.begin(), group.routers.end(),
                                      [](const auto &router) { return router.connection == "two-way"; });
     std::string others;
@@ -269,7 +318,8 @@ static void group_without_traffic(const snapshot_group &group, reason_list *list
             others +=
                 (others.empty() ? "" : ", ") + one.address + " " + std::to_string(one.most_percent) + "%";
     if (group.state == "BACKUP")
-        list->add_state(group.weight == 0 ? "weight-zero" : "redirected-elsewhere", group, "", others);
+        list->add_state(group.weight == 0 ? "weight-zero" : "redirected-elsewhere", group, "",
+                        others.empty() ? "nobody" : others);
     else if (group.state == "INIT" && two_way && !has_reason(group, {"election-blocked", "table-not-built"}))
         list->add_state("waiting-assignment", group, "",
                         (group.designated ? "this appliance" : lowest_appliance(group)) + " is designated");
@@ -278,8 +328,8 @@ static void group_without_traffic(const snapshot_group &group, reason_list *list
         list->add_state("not-designated", group, lowest_appliance(group), "");
 }
 
-// What a running group follows only when it is started again.
-static void changes_not_followed(const snapshot_group &group, reason_list *list) {
+// Changes that a running group follows only after a restart.
+void add_changes_not_followed(const snapshot_group &group, reason_list *list) {
     for (const snapshot_router &router : group.routers) {
         const bool encap = !router.forward.empty() && !group.encap.empty() && group.encap != "either" &&
                            group.encap != router.forward;
@@ -294,7 +344,14 @@ static void changes_not_followed(const snapshot_group &group, reason_list *list)
     }
 }
 
-static void group_reasons(const snapshot &shown, const snapshot_group &group, reason_list *list) {
+// wccpd is given "down" for it then.
+bool is_out_of_its_routers(const snapshot &shown, const snapshot_group &group) {
+    return shown.traffic.left.contains(group.id) ||
+           std::any_of(shown.traffic.drains.begin(), shown.traffic.drains.end(),
+                       [&](const traffic_drain &each) { return each.group == group.id; });
+}
+
+void add_group_reasons(const snapshot &shown, const snapshot_group &group, reason_list *list) {
     if (group.admin == "down") {
         list->add_state("disabled", group, "", "");
         add_noted(group.reasons, group.id, list);
@@ -311,59 +368,84 @@ static void group_reasons(const snapshot &shown, const snapshot_group &group, re
         return;
     if (!group.configured)
         list->add_state("not-configured", group, "", "");
-    add_noted(group.reasons, group.id, list);
-    // What is wrong with a packet before its group is known is about each group of its sender.
-    for (const snapshot_reason &each : shown.reasons)
-        for (const snapshot_router &router : group.routers)
-            if (router.address == each.sender && each.code.starts_with("message-"))
-                add_noted({each}, group.id, list);
+    std::vector<snapshot_reason> noted = group.reasons;
+    if (is_out_of_its_routers(shown, group))
+        std::erase_if(noted, [](const snapshot_reason &each) { return each.code == "group-disabled"; });
+    add_noted(noted, group.id, list);
+    for (const snapshot_router &router : group.routers)
+        if (const snapshot_reason *each = router_reason(shown, group, router);
+            each && std::none_of(group.reasons.begin(), group.reasons.end(),
+                                 [&](const snapshot_reason &own) { return &own == each; }))
+            add_noted({*each}, group.id, list);
     if (shown.brief)
         return;
-    unheard_routers(group, list);
-    group_without_traffic(group, list);
-    changes_not_followed(group, list);
+    add_unheard_routers(shown, group, list);
+    add_missing_traffic(group, list);
+    add_changes_not_followed(group, list);
     const bool sorts = shown.traffic.tunneld == tunneld_condition::running && shown.traffic.plane != "table";
     const bool intercepted =
         std::any_of(shown.traffic.intercepts.begin(), shown.traffic.intercepts.end(),
                     [&](const traffic_intercept &each) { return each.group == group.id; });
-    if (sorts && !intercepted && group.state == "ACTIVE")
+    if (sorts && !intercepted && group.state == "ACTIVE") {
         list->add_state("no-intercept", group, "", "");
+        // It may be the group for what servers answer to the proxies of another group.
+        list->reasons.back().harmless = !shown.traffic.intercepts.empty();
+    }
 }
 
-static void traffic_of(const snapshot &shown, reason_list *list) {
+void add_traffic_reasons(const snapshot &shown, reason_list *list) {
     for (const traffic_reason &each : traffic_reasons(shown.traffic)) {
-        reason *made = list->add(each.word.c_str(), each.group);
-        made->cause = each.text;
-        for (const char *end : {": ", " "}) // the group is named beside the cause
+        reason *made = list->add_reason(each.word.c_str(), each.group);
+        made->who = each.who;
+        made->count = each.count;
+        made->first_ms = each.first_ms;
+        made->last_ms = each.last_ms;
+        for (const snapshot_group &group : shown.groups)
+            if (each.word == "standing-by" && group.id == each.group && group.running)
+                made->first_ms = static_cast<int64_t>(group.uptime_ms ? group.uptime_ms : group.since_ms);
+        if (!each.who.empty())
+            continue; // the cause comes from the table
+        made->cause = each.text + (each.detail.empty() ? "" : " (" + each.detail + ")");
+        for (const char *end : {": ", " "}) // the heading names the group
             if (const std::string own = "group " + std::to_string(each.group) + end;
                 made->cause.starts_with(own))
                 made->cause.erase(0, own.size());
-        for (const traffic_intercept &intercept : shown.traffic.intercepts)
-            if (intercept.group == each.group && each.word == "proxy-down")
-                made->first_ms = static_cast<int64_t>(intercept.proxy_ms);
     }
 }
+
+void add_process_reason(const snapshot &shown, const std::string &name, bool absent, reason_list *list) {
+    reason *made = list->add_reason((name + (absent ? "-absent" : "-silent")).c_str(), -1);
+    const auto known = shown.processes.find(name);
+    if (absent && known != shown.processes.end() && !known->second.running)
+        made->first_ms = ms_since(known->second.since);
+}
+
+void add_restart_loops(const snapshot &shown, reason_list *list) {
+    for (const snapshot_alarm &alarm : shown.alarms) {
+        if (alarm.name != "restart-loop")
+            continue;
+        reason *made = list->add_reason("restart-loop", -1);
+        made->who = alarm.source;
+        made->offered = alarm.text;
+        made->first_ms = ms_since(alarm.since);
+    }
+}
+} // namespace
 
 std::vector<reason> reasons_of(const snapshot &shown) {
     reason_list list;
     if (!shown.unreachable.empty()) {
-        list.add("mgmtd-unreachable", -1)->offered = shown.unreachable;
+        list.add_reason("mgmtd-unreachable", -1)->offered = shown.unreachable;
     } else {
         if (shown.wccpd != wccpd_condition::running)
-            list.add(shown.wccpd == wccpd_condition::absent ? "wccpd-absent" : "wccpd-silent", -1);
+            add_process_reason(shown, "wccpd", shown.wccpd == wccpd_condition::absent, &list);
         if (shown.traffic.tunneld != tunneld_condition::running)
-            list.add(shown.traffic.tunneld == tunneld_condition::absent ? "tunneld-absent" : "tunneld-silent",
-                     -1);
-        for (const snapshot_alarm &alarm : shown.alarms)
-            if (alarm.name == "restart-loop") {
-                reason *made = list.add("restart-loop", -1);
-                made->who = alarm.source;
-                made->offered = alarm.text;
-            }
+            add_process_reason(shown, "tunneld", shown.traffic.tunneld == tunneld_condition::absent, &list);
+        add_restart_loops(shown, &list);
         add_noted(shown.reasons, -1, &list);
         for (const snapshot_group &group : shown.groups)
-            group_reasons(shown, group, &list);
-        traffic_of(shown, &list);
+            add_group_reasons(shown, group, &list);
+        add_traffic_reasons(shown, &list);
     }
     for (reason &each : list.reasons) {
         fill_reason(reason_texts(), &each);
@@ -388,12 +470,16 @@ const reason *alarm_reason(const std::vector<reason> &reasons, int group, const 
     const auto found = std::find_if(reasons.begin(), reasons.end(), [&](const reason &each) {
         return each.group == group && each.code == alarm && (group >= 0 || each.who == source);
     });
-    return found == reasons.end() ? nullptr : &*found;
+    const bool other =
+        found != reasons.end() && std::any_of(found + 1, reasons.end(), [&](const reason &each) {
+            return each.group == group && each.code == alarm; // it is not known which of them
+        });
+    return found == reasons.end() || other ? nullptr : &*found;
 }
 
 std::string reason_times(const reason &one) {
     const auto ago = [](int64_t ms) { return duration_text(static_cast<uint64_t>(ms)) + " ago"; };
-    if (one.count == 0)
+    if (one.count == 0 || one.lasts)
         return one.first_ms < 0 ? "" : "for " + duration_text(static_cast<uint64_t>(one.first_ms));
     if (one.count == 1)
         return one.last_ms < 0 ? "" : "once, " + ago(one.last_ms);

@@ -1,10 +1,10 @@
 // What mgmtctl prints.
 //
-// For a person a node is a line "NAME = VALUE"; whoever asks for one node gets its value alone. For a script
-// everything is JSON in which numbers are numbers. The keys are documented in docs/mgmtctl.md and don't
-// change.
+// For people a node is a line "NAME = VALUE", and a query for a single node prints its value only. For
+// scripts all output is JSON, in which numbers are numbers. The keys are documented in docs/mgmtctl.md and
+// don't change.
 //
-// Nothing here ends the program: main finds out at the end that nobody reads standard output any more.
+// Nothing here ends the program: main detects at the end that nobody reads standard output any more.
 #include "peers/mgmtctl/render.h"
 
 #include <algorithm>
@@ -19,17 +19,19 @@
 #include "peers/nodes/secrets.h"
 #include "runtime/common.h"
 
-// Values come from others: on a terminal they write, and do nothing else.
-static std::string harmless(std::string text) {
+namespace {
+// Values come from other machines: on a terminal they must not act as control sequences.
+std::string without_controls(std::string text) {
     for (char &c : text)
         if ((static_cast<unsigned char>(c) < 0x20 && c != '\n' && c != '\t') || c == 0x7f)
             c = '?';
     return text;
 }
+} // namespace
 
 void put(const std::string &text) {
     static const bool terminal = isatty(STDOUT_FILENO);
-    const std::string &shown = terminal ? harmless(text) : text;
+    const std::string &shown = terminal ? without_controls(text) : text;
     (void)fwrite(shown.data(), 1, shown.size(), stdout);
 }
 
@@ -88,7 +90,7 @@ int exit_of(uint32_t code) {
         return CTL_OK;
     case LC_NOT_FOUND:
         return CTL_NOT_FOUND;
-    case LC_IO_CLOSED: // wccpd has no session, or no answer in time
+    case LC_IO_CLOSED: // wccpd has no session, or has not answered in time
     case LC_IO_TIMED_OUT:
         return CTL_UNREACHABLE;
     default:
@@ -108,7 +110,8 @@ ctl_json json_failure(const ctl_failure &failure) {
     return out;
 }
 
-static std::string text_failure(const ctl_failure &failure) {
+namespace {
+std::string text_failure(const ctl_failure &failure) {
     std::string out = "mgmtctl: ";
     if (!failure.node.empty() && !failure.error.starts_with(failure.node))
         out += failure.node + ": ";
@@ -117,6 +120,7 @@ static std::string text_failure(const ctl_failure &failure) {
         out += "mgmtctl: " + failure.hint + "\n";
     return out;
 }
+} // namespace
 
 int tell_failure(const ctl_options &options, const ctl_failure &failure) {
     if (ctl_stop_signal)
@@ -178,15 +182,17 @@ ctl_json json_alarms(const std::vector<ctl_alarm> &alarms) {
 std::string text_alarms(const std::vector<ctl_alarm> &alarms) {
     if (alarms.empty())
         return "no alarm is active\n";
-    size_t names = 0, sources = 0;
+    size_t times = 0, names = 0, sources = 0;
     for (const ctl_alarm &alarm : alarms) {
+        times = std::max(times, alarm.since.size());
         names = std::max(names, alarm.name.size());
         sources = std::max(sources, alarm.source.size());
     }
     std::string out;
     for (const ctl_alarm &alarm : alarms)
-        out += alarm.since + "  " + alarm.name + std::string(names - alarm.name.size() + 2, ' ') +
-               alarm.source + std::string(sources - alarm.source.size() + 2, ' ') +
+        out += alarm.since + std::string(times - alarm.since.size() + 2, ' ') + alarm.name +
+               std::string(names - alarm.name.size() + 2, ' ') + alarm.source +
+               std::string(sources - alarm.source.size() + 2, ' ') +
                (alarm.cause.empty() ? alarm.text : alarm.cause) + "\n";
     return out;
 }

@@ -1,4 +1,4 @@
-// What a person and what a script gets to see, and how a failure is reported to either.
+// Output for people and for scripts, and the report of a failure to either.
 #pragma once
 
 #include <string>
@@ -10,14 +10,14 @@
 
 using ctl_json = nlohmann::ordered_json; // complete only where nlohmann/json.hpp is included
 
-// Standard output; a failure shows when the program ends.
+// To standard output; a failed write is reported at the end of the program.
 void put(const std::string &text);
 std::string json_line(const ctl_json &value); // with its newline
 
-// Numbers, durations and booleans become numbers and booleans, a node without value null.
+// Numbers and durations become JSON numbers, booleans JSON booleans, a node without a value null.
 ctl_json json_value(const ctl_binding &binding);
 ctl_json json_node(const ctl_binding &binding, bool secrets); // name, type, value
-// The value; a password, also one in a dump, becomes eight stars unless asked for.
+// The value. Unless `secrets`, a password becomes eight stars, in a dump as well.
 std::string shown_value(const ctl_binding &binding, bool secrets);
 // "NAME = VALUE"; further lines of the value are indented.
 std::string text_node(const ctl_binding &binding, bool secrets);
@@ -31,8 +31,8 @@ struct ctl_failure {
 };
 int exit_of(uint32_t code); // of a status code that mgmtd answered
 ctl_json json_failure(const ctl_failure &failure);
-// To standard error, or as JSON to standard output; gives the exit code. A program that a signal ends says
-// nothing.
+// To standard error, or as JSON to standard output. Returns the exit code. Prints nothing when a signal ends
+// the program.
 int tell_failure(const ctl_options &options, const ctl_failure &failure);
 
 // The active alarms, from a walk of NODE_ALARMS_RAISED.

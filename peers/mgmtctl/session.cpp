@@ -1,16 +1,16 @@
-// A session is one of the project's own client library, driven by a loop in this file over the interest list,
-// which is all that the library asks of its host.
+// A session of the project's client library, driven by a loop in this file over the library's list of
+// descriptors, which is all that the library needs of its host.
 //
-// There is one thread. Every wait is a series of rounds. A round polls what the list holds and calls its
-// functions; these read frames and end in the callbacks here, which turn an answer or an event into text at
-// once, and keep nothing of the library. A wait ends with what it waits for, with the loss of the session, at
-// its deadline, or when a signal has asked the program to end (ctl_stop_signal). These signals are blocked
-// from the check of that variable until ppoll unblocks them: none is missed in between.
+// There is one thread. Every wait is a series of rounds. A round polls the descriptors of the list and calls
+// their functions. These read frames and call the callbacks below, which convert an answer or an event to
+// text at once and keep no object of the library. A wait ends when its condition holds, when the session is
+// lost, at its deadline, or after a signal that ends the program (ctl_stop_signal). These signals are blocked
+// from the check of that variable until ppoll unblocks them, so that none is missed in between.
 //
-// The library logs what fails. For a person at a terminal these lines are noise beside the reason that is
-// given here, and the log is suspended for the life of the process.
+// The library logs failures. At a terminal these lines would only repeat the reason that is given here, and
+// the log is therefore suspended for the life of the process.
 //
-// A reason is one sentence without a period: what is wrong, and where a person would look.
+// A reason is one sentence without a period: what is wrong, and where to look.
 #include "peers/mgmtctl/session.h"
 
 #include <algorithm>
@@ -34,7 +34,9 @@
 #include "runtime/logging.h"
 #include "runtime/ttime.h"
 
-static constexpr int32_t SERVICE = 2;
+namespace {
+constexpr int32_t SERVICE = 2;
+} // namespace
 
 volatile std::sig_atomic_t ctl_stop_signal;
 
@@ -43,8 +45,9 @@ struct ctl_session {
     fdic *interests = nullptr;
     gcl *instance = nullptr;
     gcl_session *session = nullptr;
-    uint32_t awaited = 0; // message id of the request that waits, 0 for none
+    uint32_t awaited = 0; // message id of the request that waits for its answer, 0: none
     bool answered = false;
+    bool quiet = false; // queries are not logged above debug level
     ctl_reply reply;
     std::deque<ctl_event> events;
 
@@ -57,7 +60,8 @@ struct ctl_session {
     }
 };
 
-static bool fail(std::string *out_reason, const std::string &reason) {
+namespace {
+bool set_reason(std::string *out_reason, const std::string &reason) {
     if (out_reason)
         *out_reason = reason;
     return false;
@@ -65,16 +69,16 @@ static bool fail(std::string *out_reason, const std::string &reason) {
 
 // --- Rounds
 
-static bool is_connected(const ctl_session *self) {
+bool is_connected(const ctl_session *self) {
     int32_t state = GCL_SESSION_NONE;
     return gcl_session_get_state(self->session, &state, nullptr) == LC_OK && state == GCL_SESSION_CONNECTED;
 }
 
-static lc_status nothing_to_note(const fdic_event_array *, void *) {
-    return LC_OK; // each round asks for the list
+lc_status nothing_to_note(const fdic_event_array *, void *) {
+    return LC_OK; // each round reads the list anew
 }
 
-static void call_ready(const fdic_event_array *events, const std::vector<pollfd> &polled) {
+void call_ready(const fdic_event_array *events, const std::vector<pollfd> &polled) {
     constexpr short broken = POLLERR | POLLHUP | POLLNVAL;
     for (uint32_t i = 0; i < polled.size(); i++) {
         const fdic_event *event = fdic_event_array_get_quick(events, i);
@@ -85,7 +89,6 @@ static void call_ready(const fdic_event_array *events, const std::vector<pollfd>
     }
 }
 
-namespace {
 struct blocked_signals {
     sigset_t before;
     blocked_signals() {
@@ -101,11 +104,10 @@ struct blocked_signals {
 };
 
 enum class round { ran, over, interrupted };
-} // namespace
 
-// One poll until `deadline` (-1: no limit), and what is ready called. It is over as well when `other_fd` can
-// be read.
-static round run_round(ctl_session *self, int64_t deadline, int other_fd = -1) {
+// One poll until `deadline` (-1: no limit). Calls the functions of the descriptors that are ready. It also
+// ends when `other_fd` can be read.
+round run_round(ctl_session *self, int64_t deadline, int other_fd = -1) {
     const blocked_signals blocked;
     if (ctl_stop_signal)
         return round::interrupted;
@@ -132,29 +134,29 @@ static round run_round(ctl_session *self, int64_t deadline, int other_fd = -1) {
     return ready == 0 || other_ready ? round::over : round::ran;
 }
 
-// Until `done`, in the time that requests have.
+// Runs rounds until `done`, within the session's time limit.
 template <typename Done>
-static bool wait_for(ctl_session *self, const char *what, Done done, std::string *out_reason) {
+bool wait_for(ctl_session *self, const char *what, Done done, std::string *out_reason) {
     const int64_t deadline = lt_monotonic_ms() + self->timeout_ms;
     while (!done()) {
         if (!is_connected(self))
-            return fail(out_reason, std::string("mgmtd closed the session ") + what);
+            return set_reason(out_reason, std::string("mgmtd closed the session ") + what);
         const round result = run_round(self, deadline);
         if (result == round::over) {
             std::string seconds = std::to_string(self->timeout_ms / 1000);
             if (self->timeout_ms % 1000)
                 seconds += "." + std::to_string(self->timeout_ms % 1000 + 1000).substr(1);
-            return fail(out_reason, "mgmtd gave no answer in " + seconds + " s");
+            return set_reason(out_reason, "mgmtd gave no answer in " + seconds + " s");
         }
         if (result == round::interrupted && ctl_stop_signal)
-            return fail(out_reason, "interrupted");
+            return set_reason(out_reason, "interrupted");
     }
     return true;
 }
 
-// --- What comes
+// --- Answers and events
 
-static std::vector<ctl_binding> as_text(const std::vector<event_field> &fields) {
+std::vector<ctl_binding> bindings_text(const std::vector<event_field> &fields) {
     std::vector<ctl_binding> out;
     out.reserve(fields.size());
     for (const event_field &field : fields)
@@ -162,70 +164,71 @@ static std::vector<ctl_binding> as_text(const std::vector<event_field> &fields) 
     return out;
 }
 
-static lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) {
+lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) {
     auto *self = static_cast<ctl_session *>(data);
     if (self->awaited == 0 || msg->response_to != self->awaited)
-        return LC_OK; // of a request that was given up
+        return LC_OK; // the answer to a request that has timed out
     self->awaited = 0;
     self->answered = true;
     self->reply = {msg->return_code, msg->return_message ? ts_str(msg->return_message) : "",
-                   as_text(fields_of(msg)), msg->db_revision_id};
+                   bindings_text(fields_of(msg)), msg->db_revision_id};
     return LC_OK;
 }
 
-static lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
+lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
     auto *self = static_cast<ctl_session *>(data);
-    self->events.push_back({msg->text ? ts_str(msg->text) : "", as_text(fields_of(msg))});
+    self->events.push_back({msg->text ? ts_str(msg->text) : "", bindings_text(fields_of(msg))});
     return LC_OK;
 }
 
 // --- Opening
 
-static const char *const ALLOWED = "only root, the user that mgmtd runs as and the group wccpd may use it";
+const char *const ALLOWED = "only root, the user that mgmtd runs as and the group wccpd may use it";
 
-// What the library reports as one error, checked before it makes a directory and a socket of its own.
-static bool somebody_listens(std::string *out_reason) {
+// The library reports these cases as one error, after it has made a directory and a socket. They are checked
+// before that, to tell them apart.
+bool somebody_listens(std::string *out_reason) {
     const std::string path = provider_path();
     struct stat about = {};
     if (stat(path.c_str(), &about) != 0 && (errno == ENOENT || errno == ENOTDIR))
-        return fail(out_reason, "mgmtd is not running (nothing listens at " + path + ")");
+        return set_reason(out_reason, "mgmtd is not running (nothing listens at " + path + ")");
     if (access(path.c_str(), W_OK) != 0)
-        return fail(out_reason, path + ": " + strerror(errno) + "; " + ALLOWED);
+        return set_reason(out_reason, path + ": " + strerror(errno) + "; " + ALLOWED);
     if (about.st_uid != 0 && about.st_uid != geteuid())
-        return fail(out_reason, path + " belongs to user " + std::to_string(about.st_uid) +
-                                    "; only root's mgmtd and our own user's are trusted");
+        return set_reason(out_reason, path + " belongs to user " + std::to_string(about.st_uid) +
+                                          "; only root's mgmtd and our own user's are trusted");
     return true;
 }
 
-static lc_status make_instance(ctl_session *self) {
+lc_status make_instance(ctl_session *self) {
     CHECK_QUIET(fdic_init(&self->interests, nothing_to_note, nullptr));
     CHECK_QUIET(gcl_init(&self->instance, nullptr, self->interests));
     CHECK_QUIET(bn_set_global_callback_query_response_msg(self->instance, take_response, self));
     CHECK_QUIET(bn_set_global_callback_set_response_msg(self->instance, take_response, self));
     CHECK_QUIET(bn_set_global_callback_action_response_msg(self->instance, take_response, self));
     CHECK_QUIET(bn_set_global_callback_event_request_msg(self->instance, take_event, self));
-    // The kernel names the socket: those who may only look can't make one in mgmtd's directory.
+    // The kernel names the socket, because users who may only look cannot create one in mgmtd's directory.
     const sockaddr unnamed = {AF_UNIX, ""};
     return gcl_session_client_new(self->instance, "mgmtctl", &unnamed, sizeof unnamed.sa_family,
                                   &self->session);
 }
 
-static bool connect_to_mgmtd(ctl_session *self, std::string *out_reason) {
+bool connect_to_mgmtd(ctl_session *self, std::string *out_reason) {
     const lc_status made = make_instance(self);
     if (made != LC_OK)
-        return fail(out_reason, "a session can't be made: " +
-                                    std::string(lc_enum_to_string_quiet(lc_status_table, made)));
+        return set_reason(out_reason, "a session can't be made: " +
+                                          std::string(lc_enum_to_string_quiet(lc_status_table, made)));
     switch (gcl_session_client_connect_by_provider(self->session, "mgmtd", 0)) {
     case LC_OK:
         return true;
     case LC_IO_ERROR:
-        return fail(out_reason, "mgmtd is not running (nothing listens at " + provider_path() + ")");
+        return set_reason(out_reason, "mgmtd is not running (nothing listens at " + provider_path() + ")");
     default:
-        return fail(out_reason, "mgmtd can't be reached: " + std::string(strerror(errno)));
+        return set_reason(out_reason, "mgmtd can't be reached: " + std::string(strerror(errno)));
     }
 }
 
-static bool open_service(ctl_session *self, std::string *out_reason) {
+bool open_service(ctl_session *self, std::string *out_reason) {
     const auto stage = [self] {
         int32_t state = 0;
         (void)gcl_session_get_state(self->session, nullptr, &state);
@@ -237,11 +240,13 @@ static bool open_service(ctl_session *self, std::string *out_reason) {
     if (gcl_session_client_open_service(self->session, BN_PROTO, SERVICE, nullptr, 0) != LC_OK ||
         !wait_for(
             self, "before it was open", [&] { return stage() == GCL_ADMIN_OPEN_ANSWERED; }, out_reason))
-        return is_connected(self) ? false : fail(out_reason, "mgmtd closed the session before it was open");
+        return is_connected(self) ? false
+                                  : set_reason(out_reason, "mgmtd closed the session before it was open");
     if (!gcl_session_service_is_open(self->session, SERVICE))
-        return fail(out_reason, "mgmtd refuses its service to us");
+        return set_reason(out_reason, "mgmtd refuses its service to us");
     return true;
 }
+} // namespace
 
 ctl_session *ctl_open(int64_t timeout_ms, std::string *out_reason) {
     (void)lc_init();
@@ -253,15 +258,20 @@ ctl_session *ctl_open(int64_t timeout_ms, std::string *out_reason) {
     return self.release();
 }
 
+void ctl_query_quietly(ctl_session *session) {
+    session->quiet = true;
+}
+
 void ctl_close(ctl_session *session) {
     delete session;
 }
 
 // --- Requests
 
-static bool send_request(ctl_session *self, bn_request_msg *msg, ctl_reply *out, std::string *out_reason) {
+namespace {
+bool send_request(ctl_session *self, bn_request_msg *msg, ctl_reply *out, std::string *out_reason) {
     if (bn_request_msg_send(self->session, msg) != LC_OK && is_connected(self))
-        return fail(out_reason, "the request is too large for one message");
+        return set_reason(out_reason, "the request is too large for one message");
     self->awaited = msg->msg_id;
     self->answered = false;
     const bool came = wait_for(
@@ -272,9 +282,10 @@ static bool send_request(ctl_session *self, bn_request_msg *msg, ctl_reply *out,
     return came;
 }
 
-static bool no_memory(std::string *out_reason) {
-    return fail(out_reason, "the request can't be made");
+bool set_no_memory(std::string *out_reason) {
+    return set_reason(out_reason, "the request can't be made");
 }
+} // namespace
 
 bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out,
                std::string *out_reason) {
@@ -288,18 +299,22 @@ bool ctl_query_all(ctl_session *session, ctl_walk walk, const std::vector<std::s
         flags |= bn_qf_subtree | bn_qf_include_self;
     if (walk == ctl_walk::leaves)
         flags |= bn_qf_leaves_only;
+    if (session->quiet)
+        flags |= bn_qf_quiet;
     const uint32_t subop = walk == ctl_walk::node ? bn_query_get : bn_query_iterate;
     owned_request msg;
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK)
-        return no_memory(out_reason);
+        return set_no_memory(out_reason);
     for (const std::string &name : names)
         if (bn_query_request_msg_append_str(msg.pointer, subop, flags, name.c_str(), nullptr) != LC_OK)
-            return no_memory(out_reason);
+            return set_no_memory(out_reason);
     return send_request(session, msg.pointer, out, out_reason);
 }
 
-// A type left empty, or one that the value doesn't fit, travels as a string: the receiver says what it takes.
-static bn_binding *make_value(const ctl_binding &from) {
+namespace {
+// A value without a type, or one that does not fit its type, is sent as a string: mgmtd checks it and names
+// the values that it accepts.
+bn_binding *make_value(const ctl_binding &from) {
     uint32_t type = bn_type_str;
     owned_attrib fits;
     if (!type_named(from.type, &type) ||
@@ -308,11 +323,12 @@ static bn_binding *make_value(const ctl_binding &from) {
     return make_binding(from.name, {type, from.value});
 }
 
-// Who became root for this, as sudo leaves it; mgmtd knows only that it was root.
-static lc_status add_person(bn_request_msg *msg) {
+// The person who called sudo; mgmtd itself knows only that the user is root.
+lc_status add_person(bn_request_msg *msg) {
     const char *person = geteuid() == 0 ? getenv("SUDO_USER") : nullptr;
     return person && *person ? ts_new_str(&msg->audit_user, person) : LC_OK;
 }
+} // namespace
 
 bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, const ctl_order &order,
              ctl_reply *out, std::string *out_reason) {
@@ -322,17 +338,17 @@ bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, co
                            (order.ends_wait ? bn_cf_ends_wait : 0u) |
                            order.confirm_minutes << bn_cf_minutes_shift;
     if (bn_set_request_msg_create(&msg.pointer, flags) != LC_OK || add_person(msg.pointer) != LC_OK)
-        return no_memory(out_reason);
+        return set_no_memory(out_reason);
     (void)ts_free(&msg.pointer->text);
     if (ts_new_str(&msg.pointer->text, order.cause.c_str()) != LC_OK)
-        return no_memory(out_reason);
+        return set_no_memory(out_reason);
     msg.pointer->number = order.revision;
     for (const ctl_change_item &item : items) {
         owned_binding binding(make_value(item.binding));
         if (!binding.pointer ||
             bn_set_request_msg_append_binding_takeover(msg.pointer, subops[static_cast<size_t>(item.change)],
                                                        0, &binding.pointer, nullptr) != LC_OK)
-            return no_memory(out_reason);
+            return set_no_memory(out_reason);
     }
     return send_request(session, msg.pointer, out, out_reason);
 }
@@ -341,12 +357,12 @@ bool ctl_action(ctl_session *session, const std::string &name, const std::vector
                 ctl_reply *out, std::string *out_reason) {
     owned_request msg;
     if (bn_action_request_msg_create(&msg.pointer, name.c_str()) != LC_OK)
-        return no_memory(out_reason);
+        return set_no_memory(out_reason);
     for (const ctl_binding &from : bindings) {
         owned_binding binding(make_value(from));
         if (!binding.pointer ||
             bn_action_request_msg_append_binding_takeover(msg.pointer, 0, &binding.pointer, nullptr) != LC_OK)
-            return no_memory(out_reason);
+            return set_no_memory(out_reason);
     }
     return send_request(session, msg.pointer, out, out_reason);
 }
@@ -359,7 +375,7 @@ bool ctl_add_interest(ctl_session *session, const std::string &event,
     ctl_reply reply;
     if (!ctl_action(session, ACTION_ADD_INTEREST, bindings, &reply, out_reason))
         return false;
-    return reply.code == 0 || fail(out_reason, reply.message);
+    return reply.code == 0 || set_reason(out_reason, reply.message);
 }
 
 int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason,
@@ -367,7 +383,7 @@ int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::s
     const int64_t deadline = wait_ms < 0 ? -1 : lt_monotonic_ms() + wait_ms;
     while (session->events.empty()) {
         if (!is_connected(session)) {
-            fail(out_reason, "mgmtd closed the session");
+            set_reason(out_reason, "mgmtd closed the session");
             return -1;
         }
         if (run_round(session, deadline, other_fd) != round::ran && session->events.empty())

@@ -14,7 +14,7 @@ struct ctl_binding {
     std::string value;
 };
 
-// What mgmtd answers. Code 0 is success; others are status codes (14008 a bad value, ...), with the reason.
+// mgmtd's answer. Code 0 is success; others are status codes (14008: a bad value, ...), with the reason.
 struct ctl_reply {
     uint32_t code = 0;
     std::string message;
@@ -34,18 +34,20 @@ struct ctl_change_item {
     ctl_binding binding; // removed and reset ones need only the name; a type left empty is sent as a string
 };
 
-// Set by the program's handlers of SIGINT, SIGTERM and SIGHUP, 0 until then. Once it is set no wait goes on,
+// Set by the program's handlers of SIGINT, SIGTERM and SIGHUP, 0 until then. Once it is set every wait ends,
 // and a request fails with "interrupted".
 extern volatile std::sig_atomic_t ctl_stop_signal;
 
-struct ctl_session; // owned by whoever opened it
+struct ctl_session; // owned by the caller of ctl_open
 
-// Null, with the reason, when mgmtd isn't there, refuses, or doesn't answer in time. All waits of the session
-// are bounded by `timeout_ms`.
+// Null, with the reason, when mgmtd is not running, refuses, or does not answer in time. No wait of the
+// session is longer than `timeout_ms`.
 ctl_session *ctl_open(int64_t timeout_ms, std::string *out_reason);
 void ctl_close(ctl_session *session);
+// For a session that repeats its queries: wccpd logs them at debug level only.
+void ctl_query_quietly(ctl_session *session);
 
-// False, with the reason, when no answer came: the session is of no use then.
+// False, with the reason, when there was no answer; the session cannot be used any more.
 bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out,
                std::string *out_reason);
 // Several names in one request. What does not exist is left out of the answer.
@@ -54,8 +56,8 @@ bool ctl_query_all(ctl_session *session, ctl_walk walk, const std::vector<std::s
 // How a commit is made.
 struct ctl_order {
     std::string cause;            // what it is for, in the history
-    bool check_only = false;      // whether it would be taken, without making it
-    bool ends_wait = false;       // of another one that waits to be confirmed
+    bool check_only = false;      // only check whether it would be accepted
+    bool ends_wait = false;       // allowed while another commit waits to be confirmed, which it ends
     uint32_t revision = 0;        // refused when the configuration has another one; 0: any
     uint32_t confirm_minutes = 0; // in which it has to be confirmed; 0: it stays
 };
@@ -64,11 +66,11 @@ bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, co
 // Has mgmtd carry out an action.
 bool ctl_action(ctl_session *session, const std::string &name, const std::vector<ctl_binding> &bindings,
                 ctl_reply *out, std::string *out_reason);
-// Asks for an event, only with a binding that matches one of the patterns when there are any.
+// Subscribes to an event; with patterns, only when one of its bindings matches one of them.
 bool ctl_add_interest(ctl_session *session, const std::string &event,
                       const std::vector<std::string> &patterns, std::string *out_reason);
-// Waits for the next event, also one that came during a request. 1: it is here; 0: none within `wait_ms` (-1:
-// no limit); -1: the session has ended, with the reason. A signal that a handler takes ends the wait with 0,
-// and so does `other_fd` (-1: none) when it can be read.
+// Waits for the next event, which may have arrived during a request. 1: here it is; 0: none within `wait_ms`
+// (-1: no limit); -1: the session has ended, with the reason. A signal ends the wait with 0, and so does
+// `other_fd` (-1: none) when it can be read.
 int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason,
                    int other_fd = -1);

@@ -33,7 +33,7 @@
 
 static constexpr int64_t PERIOD_MS = 1000;
 static constexpr int64_t BURST_MS = 100; // events within it are one
-static constexpr int FILE_COLUMNS = 120;
+static constexpr int FILE_COLUMNS = 80;
 static constexpr size_t SCREEN_BYTES = 1 << 16; // a large screen with its colours
 static constexpr int GROUP_ROWS = 5;            // of the smallest drawing of a group that is more than a line
 static constexpr size_t PAGE_QUERIES = 32768;   // 256 groups with 32 appliances each are 18,000
@@ -76,8 +76,9 @@ static screen_form form_of(const viewer &self) {
         form.columns = std::max((known ? size.ws_col : 80) - 1, 20);
         form.rows = std::max((known ? size.ws_row : 24) - (self.options.watch ? self.options.below : 1), 2);
     }
-    form.colour =
-        self.options.colour == 1 || (self.options.colour == -1 && self.terminal && !getenv("NO_COLOR"));
+    const char *no_colour = getenv("NO_COLOR");
+    form.colour = self.options.colour == 1 ||
+                  (self.options.colour == -1 && self.terminal && !(no_colour && *no_colour));
     form.utf8 = strcmp(nl_langinfo(CODESET), "UTF-8") == 0;
     return form;
 }
@@ -280,6 +281,8 @@ static int watch(viewer *self) {
                 ctl_close(session);
                 session = nullptr;
             }
+            if (session)
+                ctl_query_quietly(session);
         }
         const int64_t began = lt_monotonic_ms();
         if (session)

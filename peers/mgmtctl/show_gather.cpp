@@ -23,6 +23,7 @@
 
 static constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
 static constexpr size_t REASONS_MAX = 64; // of a group
+static constexpr size_t PROCESSES_MAX = 8;
 
 namespace {
 struct gathering {
@@ -126,6 +127,8 @@ static const node_row<snapshot_reason> reason_rows[] = {
     {"code", [](snapshot_reason *r, const std::string &v) { r->code = clean_text(v, 31); }},
     {"sender",
      [](snapshot_reason *r, const std::string &v) { r->sender = v == "0.0.0.0" ? "" : clean_text(v, 15); }},
+    {"source",
+     [](snapshot_reason *r, const std::string &v) { r->source = v == "0.0.0.0" ? "" : clean_text(v, 15); }},
     {"offered", [](snapshot_reason *r, const std::string &v) { r->offered = clean_text(v, 63); }},
     {"wanted", [](snapshot_reason *r, const std::string &v) { r->wanted = clean_text(v, 63); }},
     {"count", [](snapshot_reason *r, const std::string &v) { r->count = number_of<uint64_t>(v, 0); }},
@@ -224,8 +227,9 @@ static bool gather_routers(gathering *work, snapshot_group *group,
         return address_order(a.address) < address_order(b.address);
     });
     for (const std::string &address : configured) {
-        const auto heard = std::find_if(group->routers.begin(), group->routers.end(),
-                                        [&](const snapshot_router &r) { return r.address == address; });
+        const auto heard =
+            std::find_if(group->routers.begin(), group->routers.end(),
+                         [&](const snapshot_router &r) { return r.address == address || r.id == address; });
         // A multicast address is where routers are looked for, and none itself.
         if (heard != group->routers.end()) {
             heard->configured = true;
@@ -382,6 +386,25 @@ static bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) 
     return true;
 }
 
+static bool gather_processes(gathering *work) {
+    ctl_reply reply;
+    if (!work->ask(ctl_walk::subtree, NODE_PROCESSES, &reply))
+        return false;
+    for (const ctl_binding &binding : reply.bindings) {
+        const std::vector<std::string> parts = parts_below(NODE_PROCESSES, binding.name);
+        if (parts.empty() || work->shown.processes.size() > PROCESSES_MAX)
+            continue;
+        snapshot_process *process = &work->shown.processes[clean_text(parts[0], 15)];
+        if (parts.size() == 1)
+            process->running = binding.value == "running";
+        else if (parts[1] == "since")
+            process->since = clean_text(binding.value, 31);
+        else if (parts[1] == "restarts")
+            process->restarts = number_of<uint64_t>(binding.value, 0);
+    }
+    return true;
+}
+
 static bool gather_alarms(gathering *work) {
     ctl_reply reply;
     if (!work->ask(ctl_walk::subtree, NODE_ALARMS_RAISED, &reply))
@@ -402,7 +425,7 @@ static bool gather_alarms(gathering *work) {
         work->shown.roles_active += binding.value == "ACTIVE";
         work->shown.roles_backup += binding.value == "BACKUP";
     }
-    return true;
+    return gather_processes(work);
 }
 
 static bool gather_redirected(gathering *work) {

@@ -1,5 +1,7 @@
 #include "peers/mgmtctl/show_model.h"
 
+#include <ctime>
+
 #include "peers/mgmtctl/nodes.h"
 
 std::vector<std::string> parts_below(const std::string &root, const std::string &name) {
@@ -26,4 +28,12 @@ int place_of_appliance(snapshot_group *inout, const std::string &address) {
     inout->appliances.emplace_back().address = address;
     inout->appliances.back().self = address == inout->address;
     return static_cast<int>(inout->appliances.size() - 1);
+}
+
+int64_t ms_since(const std::string &time_text) {
+    tm parts = {};
+    const char *end = strptime(time_text.c_str(), "%Y/%m/%d %H:%M:%S", &parts);
+    parts.tm_isdst = -1;
+    const time_t then = end ? mktime(&parts) : -1, now = time(nullptr);
+    return then < 0 || then > now ? -1 : int64_t{now - then} * 1000;
 }

@@ -5,6 +5,7 @@
 #include <charconv>
 #include <cstddef>
 #include <cstdint>
+#include <map>
 #include <string>
 #include <vector>
 
@@ -47,6 +48,7 @@ struct snapshot_alarm {
 // Why something does not work, as wccpd noted it; wccpd's codes are in the table of reasons.h.
 struct snapshot_reason {
     std::string code, sender; // the sender is empty where there is none
+    std::string source;       // of the packet that gave the reason; empty for none
     std::string offered, wanted;
     uint64_t count = 0;
     int64_t first_ms = 0, last_ms = 0; // how long ago
@@ -74,6 +76,11 @@ struct snapshot_group {
     std::vector<snapshot_table> tables;
     snapshot_table wanted; // what this appliance has sent as the designated one; without owners: unknown
 };
+struct snapshot_process {
+    bool running = false;
+    std::string since; // it runs, or is gone
+    uint64_t restarts = 0;
+};
 enum class wccpd_condition { running, silent, absent };
 struct snapshot {
     std::string unreachable; // why there is nothing of mgmtd; the rest is empty then
@@ -85,10 +92,13 @@ struct snapshot {
     size_t roles_active = 0, roles_backup = 0;
     std::vector<snapshot_alarm> alarms;
     size_t alarms_total = 0;
-    std::vector<snapshot_reason> reasons; // of packets that belong to no group
+    std::map<std::string, snapshot_process> processes; // that mgmtd has seen
+    std::vector<snapshot_reason> reasons;              // of packets that belong to no group
     traffic_state traffic;
 };
 
+// How long ago a time of a node ("2026/01/31 12:05:31") is; -1 when it is none, or in the future.
+int64_t ms_since(const std::string &time_text);
 // The number that the text begins with.
 template <typename Number>
 Number number_of(const std::string &text, Number otherwise) {

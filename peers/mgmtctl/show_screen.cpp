@@ -11,6 +11,7 @@
 #include <cstdarg>
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 
 #include "peers/mgmtctl/reasons.h"
 #include "peers/mgmtctl/show_draw.h"
@@ -82,7 +83,13 @@ static std::string alarm_words(const snapshot_alarm &alarm, const std::vector<re
                                   ? ""
                                   : alarm.source + ": ";
     const std::string text = about + alarm_cause(alarm, reasons);
-    return alarm.since.empty() ? text : text + ", since " + alarm.since;
+    char today[16] = "";
+    const time_t now = time(nullptr);
+    tm parts;
+    strftime(today, sizeof today, "%Y/%m/%d ", localtime_r(&now, &parts));
+    const std::string since =
+        alarm.since.starts_with(today) ? alarm.since.substr(strlen(today)) : alarm.since;
+    return since.empty() ? text : text + ", since " + since;
 }
 
 static std::string one_line(const snapshot_group &group, bool brief) {
@@ -145,6 +152,17 @@ struct screen {
         add_cells(&line, words, how);
         end(&line);
     }
+    // One more part of a line, or of the next one when it doesn't fit.
+    void add_part(pen *line, const std::string &words, style how = style::plain) {
+        if (line->used + 2 + static_cast<int>(words.size()) > form.columns) {
+            end(line);
+            line->out.clear();
+            line->used = 0;
+            add_cells(line, "    ");
+        }
+        add_cells(line, line->used > 4 ? "  " : "");
+        add_cells(line, words, how);
+    }
     // Over as many lines as it takes; those after the first are indented further.
     void paragraph(std::string words, style how = style::plain) {
         const auto room = static_cast<size_t>(form.columns);
@@ -189,7 +207,7 @@ static void draw_head(screen *on, size_t alarms_most) {
     on->end(&line);
     const size_t listed = std::min(shown.alarms.size(), alarms_most);
     for (size_t i = 0; i < listed; i++)
-        on->text("! " + alarm_words(shown.alarms[i], on->reasons), style::bad);
+        on->paragraph("! " + alarm_words(shown.alarms[i], on->reasons), style::bad);
     if (listed < shown.alarms_total)
         on->text("! " + plural_text(shown.alarms_total - listed, "alarm") + (listed ? " more" : ""),
                  style::bad);
@@ -203,22 +221,17 @@ static void draw_group_head(screen *on, const snapshot_group &group) {
     add_cells(&line, words, how);
     if (cause || is_in_alarm(on->shown, group))
         add_cells(&line, " !", style::bad);
-    std::string text;
-    if (group.uptime_ms)
-        text += "  up " + duration_text(group.uptime_ms);
-    if (!group.address.empty() && group.address != "0.0.0.0")
-        text += "  " + group.address + (group.interface.empty() ? "" : " on " + group.interface);
-    else if (!group.interface.empty())
-        text += "  on " + group.interface;
-    if (!group.protocol.empty())
-        text += "  " + group.protocol;
-    if (group.weight >= 0)
-        text += format("  weight %" PRId64, group.weight);
-    if (group.authenticated)
-        text += "  md5";
-    if (group.policy >= 0)
-        text += format("  policy %" PRId64, group.policy);
-    add_cells(&line, text);
+    const bool addressed = !group.address.empty() && group.address != "0.0.0.0";
+    const std::string place = (addressed ? group.address : "") +
+                              (addressed && !group.interface.empty() ? " " : "") +
+                              (group.interface.empty() ? "" : "on " + group.interface);
+    for (const std::string &part :
+         {group.uptime_ms ? "up " + duration_text(group.uptime_ms) : "", place, group.protocol,
+          group.weight >= 0 ? format("weight %" PRId64, group.weight) : "",
+          std::string(group.authenticated ? "md5" : ""),
+          group.policy >= 0 ? format("policy %" PRId64, group.policy) : ""})
+        if (!part.empty())
+            on->add_part(&line, part);
     on->end(&line);
     if (!cause)
         return;
@@ -231,28 +244,32 @@ static void draw_router(screen *on, const snapshot_group &group, const snapshot_
     const auto method = [](const std::string &word) { return word.empty() ? "-" : word.c_str(); };
     pen line = on->begin();
     add_cells(&line, format("  router %-15s ", router.address.c_str()));
-    if (router.connection == "none") {
-        const auto noted = std::find_if(group.reasons.begin(), group.reasons.end(), [&](const auto &each) {
-            return each.sender == router.address && each.count;
-        });
-        add_cells(&line, noted == group.reasons.end() ? "nothing heard" : noted->code, style::bad);
+    if (router.connection == "none" || on->shown.wccpd != wccpd_condition::running) {
+        const snapshot_reason *noted = router_reason(on->shown, group, router);
+        if (on->shown.wccpd != wccpd_condition::running)
+            add_cells(&line, "unknown", style::dim);
+        else if (group.admin == "down")
+            add_cells(&line, "not asked", style::dim);
+        else
+            add_cells(&line, noted ? noted->code : "nothing heard", style::bad);
     } else {
         add_cells(&line, format("%-7s", router.connection.c_str()),
                   router.connection == "two-way" ? style::good : style::warn);
-        add_cells(&line, format("  %8s  fwd %-3s  assign %-4s  return %s",
-                                duration_text(router.connected_ms).c_str(), method(router.forward),
-                                method(router.assign), method(router.back)));
+        add_cells(&line, format("  %8s", duration_text(router.connected_ms).c_str()));
+        on->add_part(&line, format("fwd %-3s  assign %-4s  return %s", method(router.forward),
+                                   method(router.assign), method(router.back)));
         if (router.id != router.address)
-            add_cells(&line, "  id " + router.id, style::dim);
+            on->add_part(&line, "id " + router.id, style::dim);
     }
     on->end(&line);
 }
 
 static void draw_bar(pen *line, const snapshot_appliance &one, int place) {
-    const int has = static_cast<int>(std::min<uint32_t>(one.least_percent, 100)) * BAR_CELLS;
-    const int asked = std::clamp(one.asked_percent, 0, 100) * BAR_CELLS;
+    const int cells = std::clamp(line->form.columns - line->used, 0, BAR_CELLS);
+    const int has = static_cast<int>(std::min<uint32_t>(one.least_percent, 100)) * cells;
+    const int asked = std::clamp(one.asked_percent, 0, 100) * cells;
     set_style(line, "38;5;" + std::to_string(colour_of(place)));
-    for (int i = 0; i < BAR_CELLS; i++) {
+    for (int i = 0; i < cells; i++) {
         const int middle = i * 100 + 50; // of the cell, in hundredths
         if (middle <= has && (middle <= asked || one.asked_percent < 0))
             add_glyph(line, "█", '#');
@@ -343,7 +360,7 @@ static void draw_group(screen *on, const snapshot_group &group, size_t most) {
 
 static void draw_reasons(screen *on, const std::vector<traffic_reason> &reasons, size_t most) {
     for (size_t i = 0; i < std::min(reasons.size(), most); i++)
-        on->text("  " + reasons[i].text, style::warn);
+        on->paragraph("  " + reasons[i].text, style::warn);
     draw_more(on, reasons.size(), most, "note");
 }
 
@@ -359,7 +376,7 @@ static void draw_traffic(screen *on, size_t most) {
                   one.proxy == "up"     ? style::good
                   : one.proxy == "down" ? style::bad
                                         : style::warn);
-        add_cells(&line, "  " + sorted_text(one.sorted));
+        on->add_part(&line, sorted_text(one.sorted));
         on->end(&line);
     }
     draw_more(on, traffic.intercepts.size(), most, "intercept");
@@ -400,9 +417,9 @@ static std::vector<std::string> draw_briefly(const snapshot &shown, const screen
         const auto [words, how] = group_state_words(shown, group, cause != nullptr);
         add_cells(&line, format("%-20s", words.c_str()), how);
         add_cells(&line, cause || is_in_alarm(shown, group) ? " !" : "  ", style::bad);
+        add_cells(&line, cause ? "  " + cause->code : "", style::warn);
         add_cells(&line, group.uptime_ms ? format("  up %-11s", duration_text(group.uptime_ms).c_str()) : "");
         add_cells(&line, one_line(group, shown.brief));
-        add_cells(&line, cause ? "  " + cause->code : "", style::warn);
         on.end(&line);
         drawn++;
     }

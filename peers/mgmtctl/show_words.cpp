@@ -62,7 +62,7 @@ std::string alarm_cause(const snapshot_alarm &alarm, const std::vector<reason> &
     static const struct {
         const char *name, *words;
     } known[] = {
-        {"adjacency", "a router is not connected as it should be"},
+        {"adjacency", "a router was not connected when it was checked last"},
         {"assignment", "a router does not share out the traffic as asked"},
     };
     const auto *row = std::find_if(std::begin(known), std::end(known),

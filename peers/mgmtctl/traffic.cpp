@@ -1,47 +1,47 @@
-// tunneld's nodes read into plain data, and the reasons that follow from them.
+// Reads tunneld's nodes into plain data, and finds the reasons that follow from them.
 #include "peers/mgmtctl/traffic.h"
 
 #include <algorithm>
 #include <cinttypes>
 #include <cstdio>
+#include <ctime>
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/show_draw.h"
 #include "peers/mgmtctl/show_model.h"
 #include "runtime/common.h"
 
-static constexpr size_t ENTRIES_MAX = 256; // of any one kind
-static constexpr size_t REASON_MAX = 76;   // characters of a reason's line
-
 namespace {
-// What a node says of its subject. The way down to it is given with the text, for nodes that are many.
+constexpr size_t ENTRIES_MAX = 256; // of any one kind
+constexpr int64_t OVER_MS = 300000; // after the last packet the reason has ended
+
+// How the value of a node is stored in its subject.
 template <typename Subject>
 struct state_row {
     const char *node;
     void (*take)(Subject *subject, const std::string &value);
 };
-} // namespace
 
-static uint64_t number(const std::string &text) {
+uint64_t read_count(const std::string &text) {
     return number_of<uint64_t>(text, 0);
 }
 
-static const state_row<traffic_tunnel> tunnel_rows[] = {
+const state_row<traffic_tunnel> tunnel_rows[] = {
     {"local", [](traffic_tunnel *t, const std::string &v) { t->local = clean_text(v, 15); }},
     {"remote", [](traffic_tunnel *t, const std::string &v) { t->remote = clean_text(v, 15); }},
     {"interface", [](traffic_tunnel *t, const std::string &v) { t->interface = clean_text(v, 15); }},
     {"index", [](traffic_tunnel *t, const std::string &v) { t->index = number_of<uint32_t>(v, 0); }},
-    {"packets_in", [](traffic_tunnel *t, const std::string &v) { t->in.packets = number(v); }},
-    {"bytes_in", [](traffic_tunnel *t, const std::string &v) { t->in.bytes = number(v); }},
-    {"packets_out", [](traffic_tunnel *t, const std::string &v) { t->out.packets = number(v); }},
-    {"bytes_out", [](traffic_tunnel *t, const std::string &v) { t->out.bytes = number(v); }},
-    {"fragments", [](traffic_tunnel *t, const std::string &v) { t->fragments = number(v); }},
+    {"packets_in", [](traffic_tunnel *t, const std::string &v) { t->in.packets = read_count(v); }},
+    {"bytes_in", [](traffic_tunnel *t, const std::string &v) { t->in.bytes = read_count(v); }},
+    {"packets_out", [](traffic_tunnel *t, const std::string &v) { t->out.packets = read_count(v); }},
+    {"bytes_out", [](traffic_tunnel *t, const std::string &v) { t->out.bytes = read_count(v); }},
+    {"fragments", [](traffic_tunnel *t, const std::string &v) { t->fragments = read_count(v); }},
 };
 
-static const state_row<traffic_intercept> intercept_rows[] = {
+const state_row<traffic_intercept> intercept_rows[] = {
     {"proxy", [](traffic_intercept *i, const std::string &v) { i->proxy = clean_text(v, 15); }},
     {"proxy_reason", [](traffic_intercept *i, const std::string &v) { i->proxy_reason = clean_text(v, 63); }},
-    {"proxy_ms", [](traffic_intercept *i, const std::string &v) { i->proxy_ms = number(v); }},
+    {"proxy_ms", [](traffic_intercept *i, const std::string &v) { i->proxy_ms = read_count(v); }},
     {"active", [](traffic_intercept *i, const std::string &v) { i->active = v != "false"; }},
     {"left", [](traffic_intercept *i, const std::string &v) { i->left = v == "true"; }},
     {"flows", [](traffic_intercept *i, const std::string &v) { i->flows = number_of<int64_t>(v, -1); }},
@@ -50,26 +50,27 @@ static const state_row<traffic_intercept> intercept_rows[] = {
      [](traffic_intercept *i, const std::string &v) { i->weight_percent = number_of<uint32_t>(v, 100); }},
 };
 
-static const state_row<protection_counts> protection_rows[] = {
-    {"passed", [](protection_counts *p, const std::string &v) { p->passed = number(v); }},
-    {"received", [](protection_counts *p, const std::string &v) { p->received = number(v); }},
-    {"delivered", [](protection_counts *p, const std::string &v) { p->delivered = number(v); }},
-    {"returned", [](protection_counts *p, const std::string &v) { p->returned = number(v); }},
+const state_row<protection_counts> protection_rows[] = {
+    {"passed", [](protection_counts *p, const std::string &v) { p->passed = read_count(v); }},
+    {"received", [](protection_counts *p, const std::string &v) { p->received = read_count(v); }},
+    {"delivered", [](protection_counts *p, const std::string &v) { p->delivered = read_count(v); }},
+    {"returned", [](protection_counts *p, const std::string &v) { p->returned = read_count(v); }},
 };
 
-static const state_row<protected_group> protected_group_rows[] = {
+const state_row<protected_group> protected_group_rows[] = {
     {"covered", [](protected_group *g, const std::string &v) { g->covered = v == "true"; }},
     {"reason", [](protected_group *g, const std::string &v) { g->reason = clean_text(v, 63); }},
     {"slots", [](protected_group *g, const std::string &v) { g->slots = number_of<uint32_t>(v, 0); }},
 };
 
 template <typename Subject, size_t COUNT>
-static void take_row(const state_row<Subject> (&rows)[COUNT], const std::string &node,
-                     const std::string &value, Subject *subject) {
+void take_row(const state_row<Subject> (&rows)[COUNT], const std::string &node, const std::string &value,
+              Subject *subject) {
     for (const auto &row : rows)
         if (node == row.node)
             row.take(subject, value);
 }
+} // namespace
 
 const std::vector<sorted_way> &sorted_ways() {
     static const std::vector<sorted_way> ways = {
@@ -87,26 +88,27 @@ const std::vector<sorted_way> &sorted_ways() {
     return ways;
 }
 
-static void take_sorted(const std::string &node, const std::string &value, sorted_counts *inout) {
+namespace {
+void take_sorted(const std::string &node, const std::string &value, sorted_counts *inout) {
     for (const sorted_way &way : sorted_ways()) {
         if (node == way.word)
-            (*inout)[way.word].packets = number(value);
+            (*inout)[way.word].packets = read_count(value);
         else if (node == std::string(way.word) + "_bytes")
-            (*inout)[way.word].bytes = number(value);
+            (*inout)[way.word].bytes = read_count(value);
     }
 }
 
-static void take_counted(const std::string &what, const std::string &value,
-                         std::map<std::string, uint64_t> *inout) {
+void take_counted(const std::string &what, const std::string &value, std::map<std::string, uint64_t> *inout) {
     if (inout->size() < ENTRIES_MAX)
-        (*inout)[clean_text(what, 31)] = number(value);
+        (*inout)[clean_text(what, 31)] = read_count(value);
 }
 
 // --- Gathering
 
-// The entry that a number names; they come in the order of their numbers. Null: no number, or too many.
+// The entry of this number; nodes arrive in the order of their numbers. Null: not a number, or too many
+// entries.
 template <typename Entry>
-static Entry *entry_of(std::vector<Entry> *inout, int Entry::*id, const std::string &part) {
+Entry *entry_of(std::vector<Entry> *inout, int Entry::*id, const std::string &part) {
     const int wanted = number_of(part, -1);
     if (wanted < 0)
         return nullptr;
@@ -118,8 +120,20 @@ static Entry *entry_of(std::vector<Entry> *inout, int Entry::*id, const std::str
     return &inout->back();
 }
 
-static void take_plane(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
-    if (parts.size() == 2 && parts[0] == "refused")
+// The parts after the first one name what has occurred.
+void take_occurrence(const std::vector<std::string> &parts, const std::string &value,
+                     std::map<std::string, int64_t> *inout) {
+    std::string what = parts[1];
+    for (size_t i = 2; i < parts.size(); i++)
+        what += "/" + parts[i];
+    if (inout->size() < ENTRIES_MAX)
+        (*inout)[clean_text(what, 31)] = number_of<int64_t>(value, -1);
+}
+
+void take_plane(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
+    if (parts.size() > 1 && (parts[0] == "first_ms" || parts[0] == "last_ms"))
+        take_occurrence(parts, value, parts[0] == "first_ms" ? &out->first_ms : &out->last_ms);
+    else if (parts.size() == 2 && parts[0] == "refused")
         take_counted(parts[1], value, &out->refused);
     else if (parts.size() == 2 && parts[0] == "refused_source")
         take_counted(parts[1], value, &out->refused_sources);
@@ -132,12 +146,12 @@ static void take_plane(const std::vector<std::string> &parts, const std::string 
     else if (parts[0] == "failure")
         out->failure = clean_text(value, 255);
     else if (parts[0] == "own")
-        out->own = number(value);
+        out->own = read_count(value);
     else if (parts[0] == "clamped")
-        out->clamped = number(value);
+        out->clamped = read_count(value);
 }
 
-static void take_tunnel(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
+void take_tunnel(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
     traffic_tunnel *tunnel = entry_of(&out->tunnels, &traffic_tunnel::id, parts[0]);
     if (tunnel && parts.size() == 3 && parts[1] == "refused")
         take_counted(parts[2], value, &tunnel->refused);
@@ -147,8 +161,7 @@ static void take_tunnel(const std::vector<std::string> &parts, const std::string
     take_sorted(parts[1], value, &tunnel->sorted);
 }
 
-static void take_intercept(const std::vector<std::string> &parts, const std::string &value,
-                           traffic_state *out) {
+void take_intercept(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
     traffic_intercept *intercept = entry_of(&out->intercepts, &traffic_intercept::group, parts[0]);
     if (!intercept || parts.size() != 2)
         return;
@@ -156,8 +169,7 @@ static void take_intercept(const std::vector<std::string> &parts, const std::str
     take_sorted(parts[1], value, &intercept->sorted);
 }
 
-static void take_protection(const std::vector<std::string> &parts, const std::string &value,
-                            traffic_state *out) {
+void take_protection(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
     protection_state *const all = &out->protection;
     if (parts.size() == 1 && parts[0] == "time")
         all->time = number_of<uint32_t>(value, 0);
@@ -170,8 +182,7 @@ static void take_protection(const std::vector<std::string> &parts, const std::st
         take_row(protection_rows, parts[2], value, &all->members[clean_text(parts[1], 15)]);
 }
 
-static void take_accepted(const std::vector<std::string> &parts, const std::string &value,
-                          traffic_state *out) {
+void take_accepted(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
     if (out->accepted.size() >= ENTRIES_MAX)
         return;
     std::string *router = &out->accepted[clean_text(parts[0], 15)];
@@ -179,10 +190,16 @@ static void take_accepted(const std::vector<std::string> &parts, const std::stri
         *router = clean_text(value, 15);
 }
 
-static void take_left(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
-    if (const int group = number_of(parts[0], -1); group >= 0 && group <= 255 && parts.size() == 1)
+void take_left(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
+    const int group = number_of(parts[0], -1);
+    if (group < 0 || group > 255)
+        return;
+    if (parts.size() == 1)
         out->left[group] = clean_text(value, 63);
+    else if (parts[1] == "since")
+        out->left_since[group] = clean_text(value, 31);
 }
+} // namespace
 
 void take_drain(const std::vector<std::string> &parts, const std::string &value,
                 std::vector<traffic_drain> *inout) {
@@ -191,14 +208,17 @@ void take_drain(const std::vector<std::string> &parts, const std::string &value,
         drain->state = clean_text(value, 15);
     else if (drain && parts[1] == "flows")
         drain->flows = number_of<int64_t>(value, -1);
+    else if (drain && parts[1] == "since")
+        drain->since = clean_text(value, 31);
     else if (drain && parts[1] == "until")
         drain->until = number_of<int64_t>(value, 0);
 }
 
-static void take_drained(const std::vector<std::string> &parts, const std::string &value,
-                         traffic_state *out) {
+namespace {
+void take_drained(const std::vector<std::string> &parts, const std::string &value, traffic_state *out) {
     take_drain(parts, value, &out->drains);
 }
+} // namespace
 
 bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
     static const struct {
@@ -225,7 +245,7 @@ bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
         for (const ctl_binding &binding : reply.bindings)
             if (const std::vector<std::string> parts = parts_below(walk.root, binding.name); !parts.empty())
                 walk.take(parts, binding.value, out);
-        // A tunneld that runs has a data plane.
+        // A running tunneld always has a data plane.
         if (walk.of_tunneld && (reply.code != LC_OK || out->plane.empty()))
             out->tunneld =
                 reply.code == LC_IO_TIMED_OUT ? tunneld_condition::silent : tunneld_condition::absent;
@@ -285,7 +305,7 @@ std::string drain_text(const traffic_drain &drain, int64_t now) {
         out += (drain.state == "over" ? " with " : ", ") + std::to_string(drain.flows) +
                (drain.flows == 1 ? " flow" : " flows") + (drain.state == "over" ? "" : " left");
     else if (drain.state == "over")
-        out += " by its time"; // nobody has counted
+        out += " by its time"; // the flows were not counted
     if (drain.state == "draining")
         out += ", at most " + std::to_string(std::max<int64_t>(drain.until - now, 0)) + " s more";
     return out;
@@ -297,115 +317,155 @@ namespace {
 struct reason_list {
     const char *word;
     std::vector<traffic_reason> *out;
-    void add(const std::string &text, int group = -1) const {
-        out->push_back({word, group, text.substr(0, REASON_MAX)});
+    traffic_reason *add_reason(const std::string &text, int group = -1) const {
+        out->push_back({word, group, text});
+        return &out->back();
     }
 };
-} // namespace
 
-static void own_traffic(const traffic_state &state, const reason_list &list) {
-    if (state.own > 0)
-        list.add("the router redirects this appliance's own traffic");
+int64_t age_of(const std::map<std::string, int64_t> &ages, const std::string &what) {
+    const auto found = ages.find(what);
+    return found == ages.end() ? -1 : found->second;
 }
 
-static void refused_sources(const traffic_state &state, const reason_list &list) {
+// The reason for packets that a counter has counted, unless the last one was too long ago.
+void add_counted(const traffic_state &state, const reason_list &list, const std::string &what,
+                 uint64_t packets, const std::string &text, const std::string &who = "") {
+    const int64_t last = age_of(state.last_ms, what);
+    if (packets == 0 || last > OVER_MS)
+        return;
+    traffic_reason *made = list.add_reason(text);
+    made->who = who;
+    made->count = packets;
+    made->first_ms = age_of(state.first_ms, what);
+    made->last_ms = last;
+}
+
+void find_own_traffic(const traffic_state &state, const reason_list &list) {
+    add_counted(state, list, "own", state.own, "the router redirects this appliance's own traffic");
+}
+
+void find_refused_sources(const traffic_state &state, const reason_list &list) {
     for (const auto &[address, packets] : state.refused_sources)
-        if (packets > 0 && !state.accepted.contains(address))
-            list.add("refused source " + address + ": mgmtctl tunnel accept " + address);
+        if (!state.accepted.contains(address))
+            add_counted(state, list, "refused_source/" + address, packets,
+                        "refused source " + address + ": mgmtctl tunnel accept " + address, address);
 }
 
-static void fragments(const traffic_state &state, const reason_list &list) {
+void find_fragments(const traffic_state &state, const reason_list &list) {
     uint64_t packets = 0;
     for (const traffic_tunnel &tunnel : state.tunnels)
         packets += tunnel.fragments;
-    if (packets > 0 && state.clamped == 0)
-        list.add("packets come in fragments, and the MSS of no flow has been clamped");
+    if (state.clamped == 0)
+        add_counted(state, list, "fragments", packets,
+                    "packets come in fragments, and the MSS of no flow has been clamped");
 }
 
-static void lacking_kernel(const traffic_state &state, const reason_list &list) {
+void find_lacking_kernel(const traffic_state &state, const reason_list &list) {
     if (!state.lack.empty())
-        list.add("all packets are returned: " + state.lack);
+        list.add_reason("all packets are returned: " + state.lack)->first_ms = age_of(state.first_ms, "lack");
 }
 
-static void failing_kernel(const traffic_state &state, const reason_list &list) {
+void find_failing_kernel(const traffic_state &state, const reason_list &list) {
     if (!state.failure.empty())
-        list.add("the kernel is not as wanted: " + state.failure);
+        list.add_reason("the kernel is not as wanted: " + state.failure)->first_ms =
+            age_of(state.first_ms, "failure");
 }
 
-static void left_groups(const traffic_state &state, const reason_list &list) {
-    for (const auto &[group, reason] : state.left)
-        list.add("group " + std::to_string(group) + " has left its routers" + (reason.empty() ? "" : ": ") +
-                     reason,
-                 group);
+void find_left_groups(const traffic_state &state, const reason_list &list) {
+    for (const auto &[group, reason] : state.left) {
+        traffic_reason *made = list.add_reason("group " + std::to_string(group) + " has left its routers" +
+                                                   (reason.empty() ? "" : ": ") + reason,
+                                               group);
+        if (const auto since = state.left_since.find(group); since != state.left_since.end())
+            made->first_ms = ms_since(since->second);
+    }
 }
 
-static void drains(const traffic_state &state, const reason_list &list) {
-    for (const traffic_drain &each : state.drains)
-        list.add("group " + std::to_string(each.group) +
-                     (each.state == "draining" ? ": is drained; new flows don't go to the proxy"
-                                               : ": drained, and out of its routers until \"drain cancel\""),
-                 each.group);
+void find_drains(const traffic_state &state, const reason_list &list) {
+    for (const traffic_drain &each : state.drains) {
+        const bool draining = each.state == "draining";
+        traffic_reason *made =
+            list.add_reason("group " + std::to_string(each.group) +
+                                (draining ? ": is drained; new flows don't go to the proxy"
+                                          : ": drained, and out of its routers until \"drain cancel\""),
+                            each.group);
+        made->detail = draining ? drain_text(each, time(nullptr)) : "";
+        made->first_ms = ms_since(each.since);
+    }
 }
 
-static void overloads(const traffic_state &state, const reason_list &list) {
-    for (const traffic_intercept &each : state.intercepts)
-        if (each.overloaded)
-            list.add("group " + std::to_string(each.group) +
-                         ": the proxy has too many flows; new ones are returned",
-                     each.group);
+void find_overloads(const traffic_state &state, const reason_list &list) {
+    for (const traffic_intercept &each : state.intercepts) {
+        const std::string number = std::to_string(each.group);
+        if (!each.overloaded)
+            continue;
+        traffic_reason *made = list.add_reason(
+            "group " + number + ": the proxy has too many flows; new ones are returned", each.group);
+        made->detail = each.flows < 0 ? "" : std::to_string(each.flows) + " flows";
+        made->first_ms = age_of(state.first_ms, "overload/" + number);
+    }
 }
 
-static void slow_starts(const traffic_state &state, const reason_list &list) {
-    for (const traffic_intercept &each : state.intercepts)
-        if (each.weight_percent < 100)
-            list.add("group " + std::to_string(each.group) +
-                         ": slow start; a part of the weight is announced",
-                     each.group);
+void find_slow_starts(const traffic_state &state, const reason_list &list) {
+    for (const traffic_intercept &each : state.intercepts) {
+        if (each.weight_percent >= 100)
+            continue;
+        traffic_reason *made = list.add_reason("group " + std::to_string(each.group) +
+                                                   ": slow start; a part of the weight is announced",
+                                               each.group);
+        made->detail = std::to_string(each.weight_percent) + "%";
+        made->first_ms = static_cast<int64_t>(each.proxy_ms); // it began when the proxy came up
+    }
 }
 
-static void proxies_down(const traffic_state &state, const reason_list &list) {
+void find_proxies_down(const traffic_state &state, const reason_list &list) {
     for (const traffic_intercept &each : state.intercepts)
         if (each.proxy == "down" && !state.left.contains(each.group))
-            list.add("group " + std::to_string(each.group) + ": the proxy is down" +
-                         (each.proxy_reason.empty() ? "" : ": ") + each.proxy_reason,
-                     each.group);
+            list.add_reason("group " + std::to_string(each.group) + ": the proxy is down" +
+                                (each.proxy_reason.empty() ? "" : ": ") + each.proxy_reason,
+                            each.group)
+                ->first_ms = static_cast<int64_t>(each.proxy_ms);
 }
 
-static void standing_by(const traffic_state &state, const reason_list &list) {
+void find_standing_by(const traffic_state &state, const reason_list &list) {
     for (const traffic_intercept &each : state.intercepts)
         if (!each.active)
-            list.add("group " + std::to_string(each.group) + ": not ACTIVE; new flows are returned",
-                     each.group);
+            list.add_reason("group " + std::to_string(each.group) + ": not ACTIVE; new flows are returned",
+                            each.group);
 }
 
-static void unprotected(const traffic_state &state, const reason_list &list) {
+void find_unprotected(const traffic_state &state, const reason_list &list) {
     for (const protected_group &each : state.protection.groups)
         if (!each.covered && state.protection.time != 0)
-            list.add("group " + std::to_string(each.group) + " is unprotected: " + each.reason, each.group);
+            list.add_reason("group " + std::to_string(each.group) + " is unprotected: " + each.reason,
+                            each.group)
+                ->first_ms = age_of(state.first_ms, "unprotected/" + std::to_string(each.group));
 }
+} // namespace
 
 std::vector<traffic_reason> traffic_reasons(const traffic_state &state) {
     static const struct {
         const char *word;
-        void (*look)(const traffic_state &state, const reason_list &list);
+        void (*find)(const traffic_state &state, const reason_list &list);
     } rows[] = {
-        {"lack", lacking_kernel},
-        {"failure", failing_kernel},
-        {"left", left_groups},
-        {"proxy_down", proxies_down},
-        {"drain", drains},
-        {"overload", overloads},
-        {"slow_start", slow_starts},
-        {"standing_by", standing_by},
-        {"unprotected", unprotected},
-        {"own_traffic", own_traffic},
-        {"refused_source", refused_sources},
-        {"fragments", fragments},
+        {"lack", find_lacking_kernel},
+        {"failure", find_failing_kernel},
+        {"left", find_left_groups},
+        {"proxy_down", find_proxies_down},
+        {"drain", find_drains},
+        {"overload", find_overloads},
+        {"slow_start", find_slow_starts},
+        {"standing_by", find_standing_by},
+        {"flows_unprotected", find_unprotected},
+        {"own_traffic", find_own_traffic},
+        {"refused_source", find_refused_sources},
+        {"fragments", find_fragments},
     };
     std::vector<traffic_reason> out;
     for (const auto &row : rows)
-        row.look(state, {row.word, &out});
-    for (traffic_reason &each : out) // the words of all reasons are written so
+        row.find(state, {row.word, &out});
+    for (traffic_reason &each : out) // the codes of reasons have hyphens
         std::replace(each.word.begin(), each.word.end(), '_', '-');
     return out;
 }

@@ -1,4 +1,4 @@
-// "mgmtctl intercept", "bypass" and "tunnel": what a person and a script get to read.
+// "mgmtctl intercept", "bypass" and "tunnel": their output for people and scripts.
 #include <cstdlib>
 #include <ctime>
 #include <map>
@@ -17,7 +17,8 @@
 
 // --- Changes
 
-static ctl_json as_json(const traffic_result &result) {
+namespace {
+ctl_json result_json(const traffic_result &result) {
     ctl_json subject = nullptr;
     if (!result.subject.empty())
         subject = std::string(result.kind) == "intercept" ? ctl_json(std::atol(result.subject.c_str()))
@@ -35,10 +36,10 @@ static ctl_json as_json(const traffic_result &result) {
     return out;
 }
 
-static int tell_result(const ctl_options &options, const traffic_result &result) {
+int tell_result(const ctl_options &options, const traffic_result &result) {
     const std::string subject = std::string(result.kind) + " " + result.subject;
     if (options.json) {
-        put(json_line(as_json(result)));
+        put(json_line(result_json(result)));
         return result.exit;
     }
     if (result.exit != CTL_OK)
@@ -53,13 +54,12 @@ static int tell_result(const ctl_options &options, const traffic_result &result)
     return result.exit;
 }
 
-// --- What is there
+// --- Reading
 
-namespace {
-// The nodes below each instance by their names, by the instance's own name.
+// Instances by their names, each with the nodes below it by theirs.
 using instance_list = std::vector<std::pair<std::string, std::map<std::string, std::string>>>;
 
-// Walks of one command, which ends with the first failure.
+// The queries of one command, which ends with the first failure.
 struct asking {
     ctl_link link;
     ctl_failure failure = {CTL_OK, "", "", "", 0};
@@ -75,7 +75,7 @@ struct asking {
                                      ctl_reply *reply) { return ask(walk, name, reply); },
                               out);
     }
-    // What is configured below `root`.
+    // The configuration below `root`.
     bool ask_configuration(const char *root, instance_list *out) {
         ctl_reply reply;
         if (!ask(ctl_walk::subtree, root, &reply))
@@ -94,24 +94,23 @@ struct asking {
         return failure.exit == CTL_OK;
     }
 };
-} // namespace
 
-static void put_absence(tunneld_condition condition) {
+void put_absence(tunneld_condition condition) {
     if (condition != tunneld_condition::running)
         put(condition == tunneld_condition::absent ? "tunneld has no session\n"
                                                    : "tunneld does not answer\n");
 }
 
-static void put_reasons(const std::vector<traffic_reason> &reasons, int group) {
+void put_reasons(const std::vector<traffic_reason> &reasons, int group) {
     for (const traffic_reason &reason : reasons)
-        if (reason.group == group && reason.word != "proxy-down") // has been said with the proxy
+        if (reason.group == group && reason.word != "proxy-down") // printed with the proxy already
             put((group < 0 ? "" : "  ") + reason.text + "\n");
 }
 
 // --- Intercepts
 
-static ctl_json intercept_json(const std::string &number, const std::map<std::string, std::string> &nodes,
-                               const traffic_intercept *state, const traffic_state &traffic) {
+ctl_json intercept_json(const std::string &number, const std::map<std::string, std::string> &nodes,
+                        const traffic_intercept *state, const traffic_state &traffic) {
     ctl_json out = {{"group", std::atol(number.c_str())}};
     for (const intercept_word &word : intercept_words()) {
         const auto found = nodes.find(word.node);
@@ -130,6 +129,7 @@ static ctl_json intercept_json(const std::string &number, const std::map<std::st
     out["left_reason"] = left == traffic.left.end() ? ctl_json(nullptr) : ctl_json(left->second);
     return out;
 }
+} // namespace
 
 int tell_intercepts(const ctl_options &options, const ctl_link &link, const std::string &only) {
     asking mgmtd = {link};
@@ -164,7 +164,8 @@ int tell_intercepts(const ctl_options &options, const ctl_link &link, const std:
     return CTL_OK;
 }
 
-static int list_clauses(const ctl_options &options) {
+namespace {
+int list_clauses(const ctl_options &options) {
     ctl_json all = ctl_json::array();
     for (const intercept_word &word : intercept_words()) {
         const char *fallback = intercept_word_fallback(word);
@@ -180,6 +181,7 @@ static int list_clauses(const ctl_options &options) {
         put(json_line(all));
     return CTL_OK;
 }
+} // namespace
 
 int ctl_intercept(const ctl_options &options, const std::vector<std::string> &words) {
     std::string only;
@@ -227,7 +229,8 @@ int ctl_bypass(const ctl_options &options, const std::vector<std::string> &words
 
 // --- Tunnels
 
-static std::string refused_text(const refused_counts &refused) {
+namespace {
+std::string refused_text(const refused_counts &refused) {
     std::string out;
     for (const auto &[reason, packets] : refused)
         if (packets > 0)
@@ -235,11 +238,11 @@ static std::string refused_text(const refused_counts &refused) {
     return out.empty() ? "" : "  refused by reason:" + out + "\n";
 }
 
-static std::string count_of_bytes(const traffic_count &count) {
+std::string count_of_bytes(const traffic_count &count) {
     return count_text(count.packets) + " (" + count_text(count.bytes) + " bytes)";
 }
 
-static void put_protection(const protection_state &state) {
+void put_protection(const protection_state &state) {
     put("protection of flows " +
         (state.time ? "for " + std::to_string(state.time) + " s" : std::string("switched off")) + "\n  " +
         protection_text(state.sum) + "\n");
@@ -251,7 +254,7 @@ static void put_protection(const protection_state &state) {
         put("  appliance " + address + "  " + protection_text(counts) + "\n");
 }
 
-static void put_tunnels(const traffic_state &traffic) {
+void put_tunnels(const traffic_state &traffic) {
     put("data plane " + traffic.plane + "\n" +
         (traffic.plane_reason.empty() ? "" : "  not used: " + traffic.plane_reason + "\n") +
         refused_text(traffic.refused));
@@ -268,6 +271,7 @@ static void put_tunnels(const traffic_state &traffic) {
     if (traffic.refused_sources.size() >= REFUSED_SOURCES_MAX)
         put("refused sources beyond these " + std::to_string(REFUSED_SOURCES_MAX) + " are not listed\n");
 }
+} // namespace
 
 int tell_tunnels(const ctl_options &options, const ctl_link &link) {
     asking mgmtd = {link};
@@ -302,7 +306,8 @@ int ctl_tunnel(const ctl_options &options, const std::vector<std::string> &words
 
 // --- Protection of flows
 
-static int tell_protection(const ctl_options &options, const ctl_link &link) {
+namespace {
+int tell_protection(const ctl_options &options, const ctl_link &link) {
     asking mgmtd = {link};
     traffic_state traffic;
     if (!mgmtd.ask_traffic(&traffic))
@@ -317,6 +322,7 @@ static int tell_protection(const ctl_options &options, const ctl_link &link) {
         put_absence(traffic.tunneld);
     return running ? CTL_OK : CTL_UNREACHABLE;
 }
+} // namespace
 
 int ctl_protection(const ctl_options &options, const std::vector<std::string> &words) {
     if (words.empty())

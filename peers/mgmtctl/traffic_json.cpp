@@ -2,15 +2,16 @@
 
 #include <nlohmann/json.hpp>
 
-static ctl_json text_or_null(const std::string &text) {
+namespace {
+ctl_json text_or_null(const std::string &text) {
     return text.empty() ? ctl_json(nullptr) : ctl_json(text);
 }
 
-static ctl_json count_json(const traffic_count &count) {
+ctl_json count_json(const traffic_count &count) {
     return {{"packets", count.packets}, {"bytes", count.bytes}};
 }
 
-static ctl_json sorted_json(const sorted_counts &counts) {
+ctl_json sorted_json(const sorted_counts &counts) {
     ctl_json out = ctl_json::object();
     for (const sorted_way &way : sorted_ways())
         if (const auto found = counts.find(way.word); found != counts.end())
@@ -18,7 +19,7 @@ static ctl_json sorted_json(const sorted_counts &counts) {
     return out;
 }
 
-static ctl_json tunnel_json(const traffic_tunnel &tunnel) {
+ctl_json tunnel_json(const traffic_tunnel &tunnel) {
     return {{"id", tunnel.id},
             {"local", tunnel.local},
             {"remote", tunnel.remote},
@@ -30,6 +31,7 @@ static ctl_json tunnel_json(const traffic_tunnel &tunnel) {
             {"refused", tunnel.refused},
             {"sorted", sorted_json(tunnel.sorted)}};
 }
+} // namespace
 
 ctl_json intercept_state_json(const traffic_intercept *intercept) {
     ctl_json out = {{"proxy", nullptr},      {"proxy_reason", nullptr},   {"proxy_ms", nullptr},
@@ -59,12 +61,14 @@ ctl_json drains_json(const std::vector<traffic_drain> &drains) {
     return out;
 }
 
-static ctl_json protection_counts_json(const protection_counts &counts) {
+namespace {
+ctl_json protection_counts_json(const protection_counts &counts) {
     return {{"passed", counts.passed},
             {"received", counts.received},
             {"delivered", counts.delivered},
             {"returned", counts.returned}};
 }
+} // namespace
 
 ctl_json protection_json(const protection_state &state) {
     ctl_json out = protection_counts_json(state.sum);

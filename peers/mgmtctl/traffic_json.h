@@ -7,6 +7,6 @@
 
 ctl_json traffic_json(const traffic_state &state);
 ctl_json drains_json(const std::vector<traffic_drain> &drains);
-// What tunneld answers about one intercept, null: nothing.
+// tunneld's answer about one intercept; null: it has none.
 ctl_json intercept_state_json(const traffic_intercept *intercept);
 ctl_json protection_json(const protection_state &state);

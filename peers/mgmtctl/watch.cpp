@@ -1,11 +1,10 @@
-// A watch has interests in every event that mgmtd sends, and prints each as a line or as JSON as soon as it
-// arrives.
+// A watch subscribes to all of mgmtd's events, and prints each as a line or as JSON as soon as it arrives.
 //
 // A change event carries its changes as numbered entries of several bindings each (kind, name, value after
 // and before). They arrive sorted by entry, and are printed in that order.
 //
-// With names, only changes of these nodes are watched. The wait ends each second to check whether anybody
-// still reads the output: without an event that would go unnoticed for a long time.
+// With names, only changes of these nodes are watched. The wait ends once a second to check whether anybody
+// still reads the output; otherwise, without an event, that would go unnoticed for a long time.
 #include "peers/mgmtctl/watch.h"
 
 #include <cstdio>
@@ -21,29 +20,28 @@
 #include "peers/nodes/binding_text.h"
 #include "peers/nodes/schema.h"
 
-static constexpr int64_t LOOK_MS = 1000;
-
 namespace {
+constexpr int64_t LOOK_MS = 1000;
+
 struct change_entry {
     std::string kind, name;
-    ctl_binding before, after; // without a type: there is none
+    ctl_binding before, after; // an empty type: there is no such value
 };
-// What an event is called here, and the words of its line.
+// The name of an event in JSON, and the words of its line.
 struct event_row {
     const char *event, *name, *words;
     ctl_json (*json)(const event_row &row, const ctl_event &event);
     std::string (*text)(const event_row &row, const ctl_event &event);
 };
-} // namespace
 
-static std::string value_of(const ctl_event &event, const char *name) {
+std::string value_of(const ctl_event &event, const char *name) {
     for (const ctl_binding &binding : event.bindings)
         if (binding.name == name)
             return binding.value;
     return "";
 }
 
-static std::vector<change_entry> changes_of(const ctl_event &event) {
+std::vector<change_entry> changes_of(const ctl_event &event) {
     std::map<node_name, change_entry> entries;
     for (const ctl_binding &binding : event.bindings) {
         node_name name;
@@ -63,7 +61,7 @@ static std::vector<change_entry> changes_of(const ctl_event &event) {
     }
     std::vector<change_entry> out;
     for (auto &[number, entry] : entries) {
-        entry.before.name = entry.after.name = entry.name; // a secret shows by its name
+        entry.before.name = entry.after.name = entry.name; // a secret is recognised by its name
         out.push_back(std::move(entry));
     }
     return out;
@@ -71,109 +69,109 @@ static std::vector<change_entry> changes_of(const ctl_event &event) {
 
 // --- Reports
 
-static ctl_json number(const std::string &text) {
+ctl_json json_number(const std::string &text) {
     return json_value({"", "int64", text});
 }
 
-static ctl_json alarm_json(const event_row &row, const ctl_event &event) {
+ctl_json alarm_json(const event_row &row, const ctl_event &event) {
     const std::string type = value_of(event, "alarm_type");
     return {{"event", row.name},
-            {"type", number(type)},
+            {"type", json_number(type)},
             {"name", alarm_name(type)},
             {"source", value_of(event, "param_3")},
             {"text", value_of(event, "comment")}};
 }
-static std::string alarm_text(const event_row &row, const ctl_event &event) {
+std::string alarm_text(const event_row &row, const ctl_event &event) {
     return std::string(row.words) + value_of(event, "param_3") + " " + value_of(event, "comment");
 }
 
-static ctl_json role_json(const event_row &row, const ctl_event &event) {
+ctl_json role_json(const event_row &row, const ctl_event &event) {
     return {{"event", row.name},
-            {"group", number(value_of(event, "group"))},
+            {"group", json_number(value_of(event, "group"))},
             {"role", role_name(value_of(event, "role"))},
-            {"code", number(value_of(event, "code"))}};
+            {"code", json_number(value_of(event, "code"))}};
 }
-static std::string role_text(const event_row &row, const ctl_event &event) {
+std::string role_text(const event_row &row, const ctl_event &event) {
     return row.words + value_of(event, "group") + ": " + role_name(value_of(event, "role"));
 }
 
-static ctl_json group_json(const event_row &row, const ctl_event &event) {
-    return {{"event", row.name}, {"group", number(value_of(event, "group"))}};
+ctl_json group_json(const event_row &row, const ctl_event &event) {
+    return {{"event", row.name}, {"group", json_number(value_of(event, "group"))}};
 }
-static std::string group_text(const event_row &row, const ctl_event &event) {
+std::string group_text(const event_row &row, const ctl_event &event) {
     return "group " + value_of(event, "group") + row.words;
 }
 
-static std::string reason_of(const ctl_event &event) {
+std::string reason_of(const ctl_event &event) {
     return clean_text(value_of(event, "reason"), 255);
 }
-static std::string with_reason(const char *sign, const std::string &reason) {
+std::string with_reason(const char *sign, const std::string &reason) {
     return reason.empty() ? "" : sign + reason;
 }
 
-static ctl_json leave_json(const event_row &row, const ctl_event &event) {
+ctl_json leave_json(const event_row &row, const ctl_event &event) {
     ctl_json out = group_json(row, event);
     out["reason"] = reason_of(event);
     return out;
 }
-static std::string leave_text(const event_row &row, const ctl_event &event) {
+std::string leave_text(const event_row &row, const ctl_event &event) {
     return group_text(row, event) + with_reason(": ", reason_of(event));
 }
 
-// The reason is that of the last failed check, also when the proxy is up again.
-static ctl_json proxy_json(const event_row &row, const ctl_event &event) {
+// The event has the reason of the last failed check, even when the proxy is up again.
+ctl_json proxy_json(const event_row &row, const ctl_event &event) {
     const bool up = value_of(event, "up") == "true";
     ctl_json out = group_json(row, event);
     out["proxy"] = up ? "up" : "down";
     out["reason"] = up ? ctl_json(nullptr) : ctl_json(reason_of(event));
     return out;
 }
-static std::string proxy_text(const event_row &row, const ctl_event &event) {
+std::string proxy_text(const event_row &row, const ctl_event &event) {
     const std::string subject = row.words + value_of(event, "group");
     return value_of(event, "up") == "true" ? subject + ": up"
                                            : subject + ": down" + with_reason(", ", reason_of(event));
 }
 
-static ctl_json weight_json(const event_row &row, const ctl_event &event) {
+ctl_json weight_json(const event_row &row, const ctl_event &event) {
     ctl_json out = group_json(row, event);
-    out["percent"] = number(value_of(event, "percent"));
+    out["percent"] = json_number(value_of(event, "percent"));
     return out;
 }
-static std::string weight_text(const event_row &row, const ctl_event &event) {
+std::string weight_text(const event_row &row, const ctl_event &event) {
     return group_text(row, event) + value_of(event, "percent") + " % of its weight";
 }
 
-static ctl_json drain_json(const event_row &row, const ctl_event &event) {
+ctl_json drain_json(const event_row &row, const ctl_event &event) {
     const std::string flows = value_of(event, "flows");
     ctl_json out = group_json(row, event);
     out["state"] = clean_text(value_of(event, "state"), 15);
-    out["flows"] = flows.empty() ? ctl_json(nullptr) : number(flows);
+    out["flows"] = flows.empty() ? ctl_json(nullptr) : json_number(flows);
     return out;
 }
-static std::string drain_text(const event_row &row, const ctl_event &event) {
+std::string drain_text(const event_row &row, const ctl_event &event) {
     const std::string flows = value_of(event, "flows");
     return row.words + value_of(event, "group") + ": " + clean_text(value_of(event, "state"), 15) +
            (flows.empty() ? "" : ", " + flows + " flows left");
 }
 
-static std::string process_of(const ctl_event &event) {
+std::string process_of(const ctl_event &event) {
     return event.bindings.empty() ? "" : event.bindings[0].value;
 }
-static ctl_json process_json(const event_row &row, const ctl_event &event) {
+ctl_json process_json(const event_row &row, const ctl_event &event) {
     return {{"event", row.name}, {"process", process_of(event)}};
 }
-static std::string process_text(const event_row &row, const ctl_event &event) {
+std::string process_text(const event_row &row, const ctl_event &event) {
     return "process " + process_of(event) + row.words;
 }
 
-static ctl_json plain_json(const event_row &row, const ctl_event &) {
+ctl_json plain_json(const event_row &row, const ctl_event &) {
     return {{"event", row.name}};
 }
-static std::string plain_text(const event_row &row, const ctl_event &) {
+std::string plain_text(const event_row &row, const ctl_event &) {
     return row.words;
 }
 
-static const event_row rows[] = {
+const event_row rows[] = {
     {EVENT_RAISE_ALARM, "alarm_raised", "alarm raised: ", alarm_json, alarm_text},
     {EVENT_CLEAR_ALARM, "alarm_cleared", "alarm cleared: ", alarm_json, alarm_text},
     {EVENT_ROLE_CHANGE, "role", "role of group ", role_json, role_text},
@@ -188,18 +186,19 @@ static const event_row rows[] = {
     {EVENT_TIME_ZONE, "timezone", "the time zone has changed", plain_json, plain_text},
 };
 
-static const event_row *find_row(const ctl_event &event) {
+const event_row *find_row(const ctl_event &event) {
     for (const event_row &row : rows)
         if (event.name == row.event)
             return &row;
     return nullptr;
 }
 
-// --- Forms
+// --- Events as JSON and as text
 
-static ctl_json json_side(const ctl_binding &side, bool secrets) {
+ctl_json json_side(const ctl_binding &side, bool secrets) {
     return side.type.empty() ? ctl_json(nullptr) : json_node(side, secrets)["value"];
 }
+} // namespace
 
 ctl_json json_event(const ctl_event &event, bool secrets) {
     if (event.name == EVENT_CONFIG_CHANGE) {
@@ -237,9 +236,10 @@ std::vector<std::string> text_event(const ctl_event &event, bool secrets) {
     return {row ? row->text(*row, event) : "event " + event.name};
 }
 
-// --- The word
+// --- The command
 
-static std::vector<std::string> watched_events() {
+namespace {
+std::vector<std::string> watched_events() {
     std::vector<std::string> out = {EVENT_CONFIG_CHANGE};
     for (const event_row &row : rows)
         out.emplace_back(row.event);
@@ -247,13 +247,13 @@ static std::vector<std::string> watched_events() {
 }
 
 // A name without a wildcard means the node and all below it.
-static std::string watch_pattern(const std::string &name) {
+std::string watch_pattern(const std::string &name) {
     if (name == "/")
         return "/**";
     return name.find('*') != std::string::npos ? name : name + "/**";
 }
 
-static std::string time_text(const char *format) {
+std::string time_text(const char *format) {
     const time_t now = time(nullptr);
     tm broken{};
     char text[64];
@@ -261,7 +261,7 @@ static std::string time_text(const char *format) {
     return {text, strftime(text, sizeof text, format, &broken)};
 }
 
-static void tell(const ctl_options &options, const ctl_event &event) {
+void print_event(const ctl_options &options, const ctl_event &event) {
     if (options.json) {
         ctl_json out = {{"time", time_text("%FT%T%z")}};
         out.update(json_event(event, options.secrets));
@@ -273,12 +273,12 @@ static void tell(const ctl_options &options, const ctl_event &event) {
     }
 }
 
-static bool anybody_reads() {
+bool anybody_reads() {
     pollfd out = {STDOUT_FILENO, 0, 0};
     return fflush(stdout) == 0 && !(poll(&out, 1, 0) == 1 && (out.revents & POLLERR));
 }
 
-static int follow(const ctl_options &options, ctl_session *session, const std::vector<std::string> &names,
+int follow_events(const ctl_options &options, ctl_session *session, const std::vector<std::string> &names,
                   uint64_t count) {
     std::vector<std::string> patterns;
     for (const std::string &name : names)
@@ -297,11 +297,12 @@ static int follow(const ctl_options &options, ctl_session *session, const std::v
             return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});
         if (got == 0)
             continue;
-        tell(options, event);
+        print_event(options, event);
         seen++;
     }
     return CTL_OK;
 }
+} // namespace
 
 int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count) {
     std::string reason;
@@ -311,7 +312,7 @@ int ctl_watch(const ctl_options &options, const std::vector<std::string> &names,
     ctl_session *session = ctl_open(options.timeout_ms, &reason);
     if (!session)
         return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});
-    const int code = follow(options, session, names, count);
+    const int code = follow_events(options, session, names, count);
     ctl_close(session);
     return code;
 }

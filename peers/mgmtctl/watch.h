@@ -1,9 +1,9 @@
-// Events as mgmtd sends them, for "mgmtctl watch".
+// mgmtd's events, for "mgmtctl watch".
 #pragma once
 
 #include "peers/mgmtctl/render.h"
 
-// One object, without its time. An event that isn't known has its bindings as they came.
+// One object, without its time. An unknown event has its bindings as they arrived.
 ctl_json json_event(const ctl_event &event, bool secrets);
-// Lines, without their time: one, or of a change one for each node.
+// Lines, without their time: one, or for a change one for each node.
 std::vector<std::string> text_event(const ctl_event &event, bool secrets);
