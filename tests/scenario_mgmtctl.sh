@@ -239,7 +239,7 @@ expect 0 '*nothing needs attention*' explain 51
 lab_in a1 bash -c 'ip link add eth1 type veth peer name eth4; ip link add eth2 type veth peer name eth3
     ip address add 10.9.1.1/24 dev eth1; ip address add 10.9.3.1/24 dev eth3; ip link set eth2 up; ip link set eth3 up
     ip route add unreachable 10.8.0.0/16'
-lab_start a1 taker wccp_router --router 10.9.3.1 # of port 2048
+lab_start a1 taker wccp_router --router 10.9.3.1 # occupies port 2048
 while read -r group words; do
     # shellcheck disable=SC2086
     ctl group add $group $words >/dev/null || fail "mgmtd refused group $group $words"
@@ -277,7 +277,7 @@ bad-version message-version 10.0.0.1 speaks version 0x100
 bad-digest password-mismatch 10.0.0.1 signs its messages with another password
 other-security security-missing 10.0.0.1 does not sign
 FAULTS
-expect 1 '*group 51 *security-missing: *[0-9] ago*next: *service-mismatch: *' explain
+expect 1 '*group 51 *security-missing: *[0-9] ago*next: *router-id-zero: *' explain
 expect 0 '*51  * !*10.0.0.1 does not sign*router 10.0.0.1 *security-missing*' show
 lab_ctl r1 fault none >/dev/null
 for broken in {60..67}; do ctl group delete "$broken" >/dev/null; done

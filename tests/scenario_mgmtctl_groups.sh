@@ -35,7 +35,7 @@ lab_write_config a1
 lab_mgmtd_start a1
 expect 3 '.wccpd == "absent" and .groups == []' show
 expect 0 '.done == "added" and .wccpd == "absent"' group add 50 interface eth0 router 10.0.0.1
-expect 3 '.groups[0] | .configured and (.running | not) and .routers[0].connection == "none"' show
+expect 3 '.groups[0] | .configured and (.running | not) and .routers[0].connection == "unknown"' show
 expect 0 '.done == "deleted"' group delete 50
 expect 4 '.code == 14004' group delete 50
 lab_tunneld_start a1

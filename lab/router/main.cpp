@@ -60,9 +60,9 @@ sockaddr_in make_sockaddr(address where) {
 
 int open_socket(address where) {
     const int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-    const int one = 1;
+    const int shared = IN_MULTICAST(where); // a unicast address has one program
     const sockaddr_in name = make_sockaddr(where);
-    if (fd < 0 || setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one) != 0 ||
+    if (fd < 0 || setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &shared, sizeof shared) != 0 ||
         bind(fd, reinterpret_cast<const sockaddr *>(&name), sizeof name) != 0) {
         fprintf(stderr, "wccp_router: %s: %s\n", text_of(where).c_str(), strerror(errno));
         exit(1);
