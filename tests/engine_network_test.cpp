@@ -20,7 +20,11 @@
 #include "tests/support/engine_fixture.h"
 #include "tests/support/reported_group.h"
 
-static std::function<void()> after_wait; // called once, when a descriptor is ready
+namespace {
+
+std::function<void()> after_wait; // called once, when a descriptor is ready
+
+} // namespace
 
 // Replaces the C library's, so that descriptors can change between a receiver's wait and its read.
 extern "C" int poll(pollfd *fds, nfds_t count, int wait_ms) {

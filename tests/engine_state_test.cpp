@@ -13,7 +13,11 @@
 #include "runtime/logging.h"
 #include "tests/support/reported_group.h"
 
-static std::vector<std::string> state_events; // constant, group, role and code of each
+namespace {
+
+std::vector<std::string> state_events; // constant, group, role and code of each
+
+} // namespace
 
 // Replaces the platform library's.
 extern "C" int qv_state_event_send(uint32_t one, const char *group_id, uint32_t role, const uint8_t *code,

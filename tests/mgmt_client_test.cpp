@@ -10,18 +10,20 @@
 #include "tests/support/log_lines.h"
 #include "tests/support/owners.h"
 
+namespace {
+
 using binding_owner = owner<bn_binding, bn_binding_free>;
 using bindings_owner = owner<bn_binding_array, bn_binding_array_free>;
 using response_owner = owner<bn_response_msg, bn_response_msg_free>;
 using string_owner = owner<tstring, ts_free>;
 
-static void add(bn_binding_array *bindings, const char *name, const char *value, uint32_t flags = 0,
-                uint32_t type = bn_type_str) {
+void add(bn_binding_array *bindings, const char *name, const char *value, uint32_t flags = 0,
+         uint32_t type = bn_type_str) {
     binding_owner binding;
     ASSERT_EQ(bn_binding_new_str(&binding, name, bn_attrib_value, type, flags, value), 0);
     ASSERT_EQ(bn_binding_array_append_takeover(bindings, &binding.pointer), 0);
 }
-static std::string value_of(const bn_binding_array *bindings, const char *name) {
+std::string value_of(const bn_binding_array *bindings, const char *name) {
     string_owner value;
     if (bn_binding_array_get_value_tstr_by_name(bindings, name, nullptr, &value) != 0 || !value.pointer)
         return "(none)";
@@ -132,8 +134,8 @@ struct seen {
     std::string texts;
     uint32_t fail_at;
 };
-static lc_status note(const bn_binding_array *, uint32_t index, bn_binding *, const tstring *,
-                      const tstr_array *, const tstring *last, const tstring *value, void *data) {
+lc_status note(const bn_binding_array *, uint32_t index, bn_binding *, const tstring *, const tstr_array *,
+               const tstring *last, const tstring *value, void *data) {
     auto *notes = static_cast<seen *>(data);
     if (index == notes->fail_at)
         return LC_BAD_TYPE;
@@ -156,8 +158,12 @@ TEST(client, foreach_counts_successful_calls) {
     EXPECT_EQ(mdc_foreach_binding_prequeried(nullptr, "/a", nullptr, note, &all, &count), LC_NULL);
 }
 
+} // namespace
+
 #define ENTRY "/mgmtd/notification/dbchange/1"
-static void add_change(bn_binding_array *bindings, const char *type, const char *before, const char *after) {
+namespace {
+
+void add_change(bn_binding_array *bindings, const char *type, const char *before, const char *after) {
     add(bindings, ENTRY, "");
     add(bindings, ENTRY "/name", "/n");
     if (type)
@@ -363,7 +369,11 @@ TEST(client, monitoring_answers) {
     EXPECT_EQ(empty.dispatch(), LC_ASSERTION);
 }
 
+} // namespace
+
 #define MESSAGES "/logging/syslog/action/file/\\/var\\/log\\/messages/facility/"
+
+namespace {
 
 TEST(client, log_levels_at_start) {
     log_lines log;
@@ -444,3 +454,5 @@ TEST(client, log_levels_on_change) {
     EXPECT_EQ(qv_handle_time_zone_change("/time/notify/zonechange"), 0);
     EXPECT_NE(log.take().find("Time zone change handled OK"), std::string::npos);
 }
+
+} // namespace

@@ -9,6 +9,8 @@
 #include "tests/support/hand_session.h"
 #include "tests/support/owners.h"
 
+namespace {
+
 using request_owner = owner<bn_request_msg, bn_request_msg_free>;
 using response_owner = owner<bn_response_msg, bn_response_msg_free>;
 using binding_owner = owner<bn_binding, bn_binding_free>;
@@ -17,55 +19,54 @@ using ids_owner = owner<uint32_array, uint32_array_free>;
 using string_owner = owner<tstring, ts_free>;
 using buffer_owner = owner<tbuffer, tb_free>;
 
-static wire u8(uint32_t value) {
+wire u8(uint32_t value) {
     return be(value, 1);
 }
-static wire u16(uint32_t value) {
+wire u16(uint32_t value) {
     return be(value, 2);
 }
-static wire u32(uint32_t value) {
+wire u32(uint32_t value) {
     return be(value, 4);
 }
-static wire str(const wire &text) {
+wire str(const wire &text) {
     return u32(static_cast<uint32_t>(text.size())) + text;
 }
 // Kind, id, type and flags, and the value with its length.
-static wire text_attribute(uint32_t id, uint32_t type, const wire &text) {
+wire text_attribute(uint32_t id, uint32_t type, const wire &text) {
     return u32(4) + u32(id) + u32(type) + u32(0) + str(text);
 }
-static const wire room(32, '\0');
-static wire request(uint32_t type, const wire &rest) {
+const wire room(32, '\0');
+wire request(uint32_t type, const wire &rest) {
     return u16(2) + u16(type) + u32(static_cast<uint32_t>(48 + rest.size())) + u32(7) + u32(8) + rest;
 }
-static wire response(uint32_t type, const wire &rest) {
+wire response(uint32_t type, const wire &rest) {
     return u16(2) + u16(type) + u32(static_cast<uint32_t>(52 + rest.size())) + u32(7) + u32(8) + u32(41) +
            rest;
 }
 template <typename Message>
-static void number(Message *msg) {
+void number(Message *msg) {
     msg->service_id = 2;
     msg->msg_id = 7;
     msg->transaction_id = 8;
 }
 
-static wire bytes_of(const tbuffer *buffer) {
+wire bytes_of(const tbuffer *buffer) {
     return {reinterpret_cast<const char *>(tb_buf(buffer)), static_cast<size_t>(tb_length(buffer))};
 }
 template <typename Message>
-static lc_status read(lc_status (*from)(const tbuffer *, uint32_t, Message **), const wire &bytes,
-                      Message **out) {
+lc_status read(lc_status (*from)(const tbuffer *, uint32_t, Message **), const wire &bytes, Message **out) {
     buffer_owner buffer;
     EXPECT_EQ(tb_new_buf(&buffer, bytes.data(), static_cast<int32_t>(bytes.size())), 0);
     return from(buffer, 32, out);
 }
-static lc_status read_request(const wire &bytes, bn_request_msg **out) {
+lc_status read_request(const wire &bytes, bn_request_msg **out) {
     return read(bn_request_msg_deserialize, bytes, out);
 }
 
 // The message is written as these bytes, also after reading them; anything shorter is refused.
 template <typename Owner, typename Message>
-static void expect_bytes(Message *msg, const wire &golden, lc_status (*to)(Message *, uint32_t, tbuffer **),
-                         lc_status (*from)(const tbuffer *, uint32_t, Message **)) {
+void expect_bytes(Message *msg, const wire &golden, lc_status (*to)(Message *, uint32_t, tbuffer **),
+                  lc_status (*from)(const tbuffer *, uint32_t, Message **)) {
     buffer_owner written, again;
     ASSERT_EQ(to(msg, 32, &written), 0);
     ASSERT_EQ(bytes_of(written), room + golden);
@@ -81,12 +82,12 @@ static void expect_bytes(Message *msg, const wire &golden, lc_status (*to)(Messa
         EXPECT_EQ(cut.pointer, nullptr);
     }
 }
-static void expect_request(bn_request_msg *msg, uint32_t type, const wire &rest) {
+void expect_request(bn_request_msg *msg, uint32_t type, const wire &rest) {
     number(msg);
     expect_bytes<request_owner>(msg, request(type, rest), bn_request_msg_serialize,
                                 bn_request_msg_deserialize);
 }
-static void expect_response(bn_response_msg *msg, uint32_t type, const wire &rest) {
+void expect_response(bn_response_msg *msg, uint32_t type, const wire &rest) {
     number(msg);
     expect_bytes<response_owner>(msg, response(type, rest), bn_response_msg_serialize,
                                  bn_response_msg_deserialize);
@@ -262,7 +263,7 @@ TEST(messages, a_nul_in_a_text_is_refused) {
 
 // ---- Memory
 
-static size_t allocated() {
+size_t allocated() {
     const struct mallinfo2 info = mallinfo2();
     return info.uordblks + info.hblkhd;
 }
@@ -612,3 +613,5 @@ TEST_F(MessageSession, SentMessagesAreLogged) {
     EXPECT_NE(dump.find("rn[49]: id 1049 n\n"), wire::npos);
     EXPECT_EQ(dump.find("rn[50]"), wire::npos);
 }
+
+} // namespace

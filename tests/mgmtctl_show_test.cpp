@@ -18,9 +18,10 @@
 #include "peers/mgmtctl/show_texts.h"
 #include "runtime/common.h"
 
+namespace {
+
 using json = nlohmann::json;
 
-namespace {
 const std::string CONFIG = "/qv/wccpd/wccp/srv_grp/config/", STATE = "/qv/wccpd/wccp/srv_grp/state/";
 const std::string ALARM = "/qv/alarms/state/raised/196638/eth0:grp:51";
 
@@ -163,7 +164,6 @@ std::string joined(const std::vector<std::string> &lines) {
         out += line + "\n";
     return out;
 }
-} // namespace
 
 TEST(Show, TellsTheWholeOfAGroup) {
     const snapshot shown = one_group().gather();
@@ -263,7 +263,7 @@ TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
 
 // --- Reasons
 
-static int explained(const snapshot &shown, int group, std::string *out, bool as_json = false) {
+int explained(const snapshot &shown, int group, std::string *out, bool as_json = false) {
     ctl_options options;
     options.json = as_json;
     testing::internal::CaptureStdout();
@@ -372,7 +372,7 @@ TEST(Show, WhatIsNotKnownIsNotSaid) {
     EXPECT_EQ(explained(from.gather(other), 52, &text, true), 2);
 }
 
-static std::string text_of_file(const char *name) {
+std::string text_of_file(const char *name) {
     std::ifstream in(std::string(WCCP_SOURCE_DIR "/") + name);
     return {std::istreambuf_iterator<char>(in), {}};
 }
@@ -394,7 +394,7 @@ TEST(Show, EveryReasonHasWordsAndIsInTheDocuments) {
 
 // P, T, I, G, L: of the data plane, a tunnel, an intercept, protection, a group that is out of its routers;
 // X: an intercept's configuration, A: an accepted source.
-static void add_traffic(canned *from, const char *lines) {
+void add_traffic(canned *from, const char *lines) {
     static const std::map<char, const char *> roots = {
         {'P', NODE_PLANE_STATE},         {'T', NODE_TUNNEL_STATE},     {'I', NODE_INTERCEPT_STATE},
         {'L', NODE_ALARM_STATE "/left"}, {'X', NODE_INTERCEPT_CONFIG}, {'A', NODE_ACCEPT_CONFIG},
@@ -404,7 +404,7 @@ static void add_traffic(canned *from, const char *lines) {
         from->add(std::string(roots.at(name[0])) + name.substr(1), value);
 }
 
-static const char *const TRAFFIC =
+const char *const TRAFFIC =
     "P/name user|P/reason kernel: no GRE|P/lack no tproxy|P/failure wccp0: busy\033|P/clamped "
     "0|P/refused/source 9|P/refused_source/10.0.0.9 9|"
     "T/3 3|T/3/local 10.0.0.101|T/3/remote 10.0.0.1|T/3/interface wccp0|T/3/index 12|T/3/packets_in 1234567|"
@@ -557,3 +557,5 @@ TEST(Show, AssignmentTextsAreReadTolerantly) {
     EXPECT_LE(from.appliances.size(), 32u);
     EXPECT_LE(from.tables.size(), 32u);
 }
+
+} // namespace

@@ -236,14 +236,17 @@ const struct {
      "bridge0 0/0", "va 0/0"},
 };
 
+int transported;
+
 } // namespace
 
-static int transported;
 extern "C" int qv_state_event_transport(uint32_t one, const char *group_id, uint32_t role,
                                         const uint8_t *code, gcl_session *) {
     EXPECT_TRUE(one == 1 && strcmp(group_id, "51") == 0 && role == 1 && *code == 237);
     return transported++; // accepts the first
 }
+
+namespace {
 
 TEST(Closed, StateEventsArePassedToTheProgram) {
     const uint8_t code = 237;
@@ -351,7 +354,7 @@ TEST_F(Netlink, AnyOrderOfEverythingEndsInTheRightState) {
 
 // The library's thread is busy while exit() runs. Streams are flushed after the last destructor, also after
 // those of libraries.
-static ssize_t draw_out(void *, const char *, size_t count) {
+ssize_t draw_out(void *, const char *, size_t count) {
     usleep(100000);
     return static_cast<ssize_t>(count);
 }
@@ -381,3 +384,5 @@ TEST(Exit, NothingThatTheThreadUsesIsDestroyed) {
         ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
     }
 }
+
+} // namespace

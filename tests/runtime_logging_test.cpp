@@ -14,29 +14,31 @@
 #include "runtime/logging_levels.h"
 #include "tests/support/log_daemon.h"
 
-static constexpr const char *LINK = "/var/opt/rvl/output/sysloglevel";
-static constexpr const char *ZONE = "/var/opt/rvl/output/localtime";
+namespace {
 
-static void set_link(const char *target) {
+constexpr const char *LINK = "/var/opt/rvl/output/sysloglevel";
+constexpr const char *ZONE = "/var/opt/rvl/output/localtime";
+
+void set_link(const char *target) {
     unlink(LINK);
     if (target) {
         ASSERT_EQ(symlink(target, LINK), 0);
     }
 }
-static void write_file(const char *path, const std::string &text) {
+void write_file(const char *path, const std::string &text) {
     std::ofstream(path) << text;
 }
-static std::string read_file(const char *path) {
+std::string read_file(const char *path) {
     std::ifstream file(path);
     return {std::istreambuf_iterator<char>(file), {}};
 }
 
 // The text after the syslog head and the thread mark.
-static std::string body(const std::string &line) {
+std::string body(const std::string &line) {
     const size_t mark = line.find("TID ");
     return mark == std::string::npos ? line : line.substr(line.find(": ", mark) + 2);
 }
-static bool matches(const std::string &text, const char *pattern) {
+bool matches(const std::string &text, const char *pattern) {
     return std::regex_match(text, std::regex(pattern));
 }
 
@@ -246,3 +248,5 @@ TEST(Files, TheFacilityAndTheDebugLog) {
     EXPECT_EQ(lc_log_file("/no/such/directory", "x"), 1);
     unlink(DEBUG);
 }
+
+} // namespace

@@ -22,13 +22,18 @@
 #include "runtime/logging.h"
 #include "tests/support/log_daemon.h"
 
+namespace {
+
 constexpr uint64_t BLOCK_BYTES = 10000; // 12288 in pages
 constexpr key_t BLOCK_KEY = 0x12345;
 constexpr size_t REGISTRY_BYTES = 361608;
 
 // Replaces sleep(): nothing waits here, and a case may change something in the meantime.
-static unsigned slept;
-static std::function<void()> while_asleep;
+unsigned slept;
+std::function<void()> while_asleep;
+
+} // namespace
+
 extern "C" unsigned sleep(unsigned seconds) {
     slept += seconds;
     if (while_asleep)
@@ -36,12 +41,14 @@ extern "C" unsigned sleep(unsigned seconds) {
     return 0;
 }
 
-static void write_conf(const std::string &text) {
+namespace {
+
+void write_conf(const std::string &text) {
     std::ofstream(CMEM_CONF_PATH) << text;
 }
 
 // Runs `body` in a child process and returns its wait status: 0 if nothing failed.
-static int in_process(bool own_keys, const std::function<void()> &body) {
+int in_process(bool own_keys, const std::function<void()> &body) {
     fflush(nullptr);
     const pid_t child = fork();
     if (child == 0) {
@@ -55,22 +62,27 @@ static int in_process(bool own_keys, const std::function<void()> &body) {
     (void)waitpid(child, &status, 0);
     return status;
 }
+
+} // namespace
+
 #define IN_CHILD(...) ASSERT_EQ(in_process(true, [&]() __VA_ARGS__), 0)
 
+namespace {
+
 // The bytes of the registry, which is created empty if it does not exist.
-static uint8_t *registry_bytes() {
+uint8_t *registry_bytes() {
     return static_cast<uint8_t *>(
         shmat(shmget(CMEM_REGISTRY_KEY, REGISTRY_BYTES, IPC_CREAT | 0777), nullptr, 0));
 }
-static std::atomic<uint32_t> &registry_state() {
+std::atomic<uint32_t> &registry_state() {
     return *reinterpret_cast<std::atomic<uint32_t> *>(registry_bytes() + 361600);
 }
-static shmid_ds segment_of(key_t key) {
+shmid_ds segment_of(key_t key) {
     shmid_ds status = {};
     EXPECT_EQ(shmctl(shmget(key, 0, 0), IPC_STAT, &status), 0);
     return status;
 }
-static uint8_t *create(uint64_t length, const char *name) {
+uint8_t *create(uint64_t length, const char *name) {
     return static_cast<uint8_t *>(cmem_create_block(length, name));
 }
 
@@ -320,3 +332,5 @@ TEST(DisplayBuffer, HoldsWhatFits) {
     EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "x"), 0u);
     EXPECT_STREQ(csys_display_buf_text(buffer), "");
 }
+
+} // namespace

@@ -15,17 +15,19 @@
 #include "runtime/ttime.h"
 #include "tests/support/log_daemon.h"
 
-static void log_numbered(int from, int to) {
+namespace {
+
+void log_numbered(int from, int to) {
     for (int i = from; i < to; i++) {
         QV_LOG(LC_LOG_DEBUG, "line %d.", i);
     }
 }
 // The number after `words`, -1 without them.
-static int number_in(const std::string &line, const char *words) {
+int number_in(const std::string &line, const char *words) {
     const size_t at = line.find(words);
     return at == std::string::npos ? -1 : atoi(line.c_str() + at + strlen(words));
 }
-static void expect_lines(const std::vector<std::string> &lines, size_t begin, int from, int to) {
+void expect_lines(const std::vector<std::string> &lines, size_t begin, int from, int to) {
     ASSERT_EQ(lines.size() - begin, static_cast<size_t>(to - from));
     for (int i = from; i < to; i++)
         ASSERT_EQ(number_in(lines[begin + static_cast<size_t>(i - from)], "line "), i);
@@ -51,7 +53,7 @@ INSTANTIATE_TEST_SUITE_P(Sockets, Syslog, testing::Values(SOCK_DGRAM, SOCK_STREA
 
 // Logs 500 lines while another thread reads, with a pause after each line. On a busy machine the reader may
 // be held up as well, so there are three attempts.
-static void expect_burst(log_daemon *daemon, useconds_t rest_us) {
+void expect_burst(log_daemon *daemon, useconds_t rest_us) {
     std::vector<std::string> lines;
     for (int attempt = 0; attempt < 3 && lines.size() != 500; attempt++) {
         (void)daemon->take();
@@ -184,3 +186,5 @@ TEST_P(Syslog, AForkedChildCanLog) {
     reader.join();
     EXPECT_GE(from_children, 15); // all of them, unless the reader is held up on a busy machine
 }
+
+} // namespace

@@ -31,16 +31,17 @@
 #include "runtime/ttime.h"
 #include "runtime/version.h"
 
-static constexpr int64_t PERIOD_MS = 1000;
-static constexpr int64_t BURST_MS = 100; // events within it are one
-static constexpr int FILE_COLUMNS = 80;
-static constexpr size_t SCREEN_BYTES = 1 << 16; // a large screen with its colours
-static constexpr int GROUP_ROWS = 5;            // of the smallest drawing of a group that is more than a line
-static constexpr size_t PAGE_QUERIES = 32768;   // 256 groups with 32 appliances each are 18,000
-
-static volatile std::sig_atomic_t pause_wanted;
-
 namespace {
+
+constexpr int64_t PERIOD_MS = 1000;
+constexpr int64_t BURST_MS = 100; // events within it are one
+constexpr int FILE_COLUMNS = 80;
+constexpr size_t SCREEN_BYTES = 1 << 16; // a large screen with its colours
+constexpr int GROUP_ROWS = 5;            // of the smallest drawing of a group that is more than a line
+constexpr size_t PAGE_QUERIES = 32768;   // 256 groups with 32 appliances each are 18,000
+
+volatile std::sig_atomic_t pause_wanted;
+
 struct viewer;
 struct renderer {
     bool (*is_wanted)(const viewer &self);
@@ -56,9 +57,8 @@ struct viewer {
     bool broken = false;             // nobody reads the output
     bool unwritten = false;          // the page could not be written
 };
-} // namespace
 
-static bool write_out(viewer *self, const std::string &text) {
+bool write_out(viewer *self, const std::string &text) {
     if (fwrite(text.data(), 1, text.size(), stdout) != text.size() || fflush(stdout) != 0)
         self->broken = true;
     return !self->broken;
@@ -66,7 +66,7 @@ static bool write_out(viewer *self, const std::string &text) {
 
 // --- The terminal
 
-static screen_form form_of(const viewer &self) {
+screen_form form_of(const viewer &self) {
     screen_form form;
     form.columns = FILE_COLUMNS;
     winsize size = {};
@@ -83,7 +83,7 @@ static screen_form form_of(const viewer &self) {
     return form;
 }
 
-static snapshot_limits limits_of(const viewer &self) {
+snapshot_limits limits_of(const viewer &self) {
     snapshot_limits limits;
     limits.queries = self.how->queries;
     if (self.terminal && self.how->is_screen) {
@@ -95,7 +95,7 @@ static snapshot_limits limits_of(const viewer &self) {
     return limits;
 }
 
-static void take_screen(viewer *self, bool take) {
+void take_screen(viewer *self, bool take) {
     if (self->on_screen == take || self->options.below > 0)
         return;
     self->on_screen = take;
@@ -104,7 +104,7 @@ static void take_screen(viewer *self, bool take) {
 
 // --- One snapshot
 
-static std::string clock_text() {
+std::string clock_text() {
     char text[16];
     const time_t now = time(nullptr);
     tm parts;
@@ -114,14 +114,14 @@ static std::string clock_text() {
 }
 
 // Of a line that can go: a group or its proxy, whatever it says, an alarm or a note.
-static std::string key_of(const std::string &line) {
+std::string key_of(const std::string &line) {
     for (const char *kind : {"group ", "proxy of "})
         if (line.starts_with(kind))
             return line.substr(0, line.find("  "));
     return line.starts_with("alarm ") || line.starts_with("note ") ? line : "";
 }
 
-static void print_changes(viewer *self, const snapshot &shown) {
+void print_changes(viewer *self, const snapshot &shown) {
     const std::vector<std::string> now = draw_lines(shown);
     const auto missing = [](const std::vector<std::string> &from, const std::string &line) {
         return std::find(from.begin(), from.end(), line) == from.end();
@@ -140,11 +140,11 @@ static void print_changes(viewer *self, const snapshot &shown) {
     write_out(self, text);
 }
 
-static void show_json(viewer *self, const snapshot &shown) {
+void show_json(viewer *self, const snapshot &shown) {
     write_out(self, draw_json(shown) + "\n");
 }
 
-static void show_page(viewer *self, const snapshot &shown) {
+void show_page(viewer *self, const snapshot &shown) {
     char made[32], host[HOST_NAME_MAX + 1] = "";
     page_origin origin;
     origin.now = time(nullptr);
@@ -166,7 +166,7 @@ static void show_page(viewer *self, const snapshot &shown) {
     }
 }
 
-static void show_screen(viewer *self, const snapshot &shown) {
+void show_screen(viewer *self, const snapshot &shown) {
     screen_form form = form_of(*self);
     if (self->options.watch)
         form.corner = "   " + clock_text();
@@ -183,7 +183,7 @@ static void show_screen(viewer *self, const snapshot &shown) {
 }
 
 // The first that is wanted.
-static const renderer renderers[] = {
+const renderer renderers[] = {
     {[](const viewer &self) { return !self.options.html.empty(); }, show_page, false, PAGE_QUERIES},
     {[](const viewer &self) { return self.options.json; }, show_json, false, snapshot_limits{}.queries},
     {[](const viewer &self) { return self.options.watch && !self.terminal; }, print_changes, false,
@@ -191,7 +191,7 @@ static const renderer renderers[] = {
     {[](const viewer &) { return true; }, show_screen, true, snapshot_limits{}.queries},
 };
 
-static snapshot look(const viewer &self, ctl_session *session) {
+snapshot look(const viewer &self, ctl_session *session) {
     return gather_snapshot(
         [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
             return ctl_query(session, walk, name, out, out_reason);
@@ -201,7 +201,7 @@ static snapshot look(const viewer &self, ctl_session *session) {
 
 // --- Staying live
 
-static void take_signal(int number) {
+void take_signal(int number) {
     if (number == SIGTSTP)
         pause_wanted = 1;
     else if (number != SIGWINCH)
@@ -209,7 +209,7 @@ static void take_signal(int number) {
 }
 
 // Those that would leave the terminal as it is; main has taken the others. What was ignored stays so.
-static void take_signals() {
+void take_signals() {
     struct sigaction action = {}, before;
     action.sa_handler = take_signal; // without SA_RESTART: it ends a wait
     for (const int number : {SIGQUIT, SIGTSTP, SIGWINCH})
@@ -217,11 +217,11 @@ static void take_signals() {
             sigaction(number, &action, nullptr);
 }
 
-static void wait_without_session() {
+void wait_without_session() {
     (void)poll(nullptr, 0, PERIOD_MS);
 }
 
-static void pause_if_wanted(viewer *self) {
+void pause_if_wanted(viewer *self) {
     if (!pause_wanted)
         return;
     pause_wanted = 0;
@@ -229,7 +229,7 @@ static void pause_if_wanted(viewer *self) {
     raise(SIGSTOP);
 }
 
-static bool add_interests(ctl_session *session, std::string *out_reason) {
+bool add_interests(ctl_session *session, std::string *out_reason) {
     static const struct {
         const char *event;
         std::vector<std::string> patterns;
@@ -252,7 +252,7 @@ static bool add_interests(ctl_session *session, std::string *out_reason) {
 }
 
 // Until it is time for the next snapshot, after one that cost so long. False: the session has ended.
-static bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reason) {
+bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reason) {
     const int64_t began = lt_monotonic_ms();
     int64_t until = began + std::max(PERIOD_MS, 4 * cost_ms);
     while (!ctl_stop_signal && !pause_wanted) {
@@ -268,7 +268,7 @@ static bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *ou
     return true;
 }
 
-static int watch(viewer *self) {
+int watch(viewer *self) {
     ctl_session *session = nullptr;
     take_signals();
     if (self->terminal)
@@ -307,6 +307,8 @@ static int watch(viewer *self) {
         ctl_close(session);
     return CTL_OK;
 }
+
+} // namespace
 
 int ctl_show(const ctl_options &options) {
     viewer self = {options, nullptr, false, false, {}, false, false};

@@ -21,11 +21,12 @@
 #include "peers/mgmtctl/show_texts.h"
 #include "runtime/common.h"
 
-static constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
-static constexpr size_t REASONS_MAX = 64; // of a group
-static constexpr size_t PROCESSES_MAX = 8;
-
 namespace {
+
+constexpr size_t ROUTERS_MAX = 64; // of a group, configured ones and others
+constexpr size_t REASONS_MAX = 64; // of a group
+constexpr size_t PROCESSES_MAX = 8;
+
 struct gathering {
     const snapshot_query &query;
     const snapshot_limits &limits;
@@ -63,25 +64,24 @@ struct node_row {
     const char *node;
     void (*take)(Subject *subject, const std::string &value);
 };
-} // namespace
 
 template <typename Subject, size_t COUNT>
-static void take_node(const node_row<Subject> (&rows)[COUNT], const std::string &node,
-                      const std::string &value, Subject *subject) {
+void take_node(const node_row<Subject> (&rows)[COUNT], const std::string &node, const std::string &value,
+               Subject *subject) {
     for (const auto &row : rows)
         if (node == row.node)
             row.take(subject, value);
 }
 
 // "GRE" and the like, as words of the configuration; "not set" and "not-set" are none.
-static std::string method_word(const std::string &value) {
+std::string method_word(const std::string &value) {
     std::string out = clean_text(value, 16);
     std::transform(out.begin(), out.end(), out.begin(),
                    [](char c) { return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c; });
     return out.starts_with("not") ? "" : out;
 }
 
-static const node_row<snapshot_router> router_rows[] = {
+const node_row<snapshot_router> router_rows[] = {
     {"state",
      [](snapshot_router *r, const std::string &v) {
          r->connection = v.starts_with("TWO-WAY")   ? "two-way"
@@ -97,7 +97,7 @@ static const node_row<snapshot_router> router_rows[] = {
      [](snapshot_router *r, const std::string &v) { r->connected_ms = number_of<uint64_t>(v, 0); }},
 };
 
-static const node_row<snapshot_group> group_rows[] = {
+const node_row<snapshot_group> group_rows[] = {
     {"oper",
      [](snapshot_group *g, const std::string &v) {
          g->running = true;
@@ -111,7 +111,7 @@ static const node_row<snapshot_group> group_rows[] = {
      [](snapshot_group *g, const std::string &v) { g->routers_heard = number_of<size_t>(v, 0); }},
 };
 
-static const node_row<snapshot_group> config_rows[] = {
+const node_row<snapshot_group> config_rows[] = {
     {"interface", [](snapshot_group *g, const std::string &v) { g->interface = clean_text(v, 15); }},
     {"admin", [](snapshot_group *g, const std::string &v) { g->admin = clean_text(v, 15); }},
     {"protocol", [](snapshot_group *g, const std::string &v) { g->protocol = clean_text(v, 31); }},
@@ -123,7 +123,7 @@ static const node_row<snapshot_group> config_rows[] = {
     {"policy_grp", [](snapshot_group *g, const std::string &v) { g->policy = number_of<int64_t>(v, -1); }},
 };
 
-static const node_row<snapshot_reason> reason_rows[] = {
+const node_row<snapshot_reason> reason_rows[] = {
     {"code", [](snapshot_reason *r, const std::string &v) { r->code = clean_text(v, 31); }},
     {"sender",
      [](snapshot_reason *r, const std::string &v) { r->sender = v == "0.0.0.0" ? "" : clean_text(v, 15); }},
@@ -137,7 +137,7 @@ static const node_row<snapshot_reason> reason_rows[] = {
 };
 
 // Those below `above`. One that has ended meanwhile has no code, and is left out.
-static bool gather_reasons(gathering *work, const std::string &above, std::vector<snapshot_reason> *out) {
+bool gather_reasons(gathering *work, const std::string &above, std::vector<snapshot_reason> *out) {
     ctl_reply reply;
     const std::string root = above + "/reason";
     if (!work->ask_wccpd(ctl_walk::subtree, root, &reply))
@@ -159,12 +159,12 @@ static bool gather_reasons(gathering *work, const std::string &above, std::vecto
     return true;
 }
 
-static std::string group_root(const char *above, int id) {
+std::string group_root(const char *above, int id) {
     return std::string(above) + "/" + std::to_string(id);
 }
 
 // What is configured; the addresses of its routers go to `out_routers`.
-static bool gather_config(gathering *work, snapshot_group *group, std::vector<std::string> *out_routers) {
+bool gather_config(gathering *work, snapshot_group *group, std::vector<std::string> *out_routers) {
     ctl_reply reply;
     const std::string root = group_root(NODE_GROUP_CONFIG, group->id);
     if (!work->ask(ctl_walk::subtree, root, &reply))
@@ -180,8 +180,8 @@ static bool gather_config(gathering *work, snapshot_group *group, std::vector<st
     return true;
 }
 
-static void take_load(snapshot_group *group, snapshot_router *router, const std::string &address,
-                      const std::string &value) {
+void take_load(snapshot_group *group, snapshot_router *router, const std::string &address,
+               const std::string &value) {
     if (router->loads.size() >= APPLIANCES_MAX)
         return;
     const snapshot_load load = {clean_text(address, 15), number_of<uint32_t>(value, 0)};
@@ -195,13 +195,12 @@ static void take_load(snapshot_group *group, snapshot_router *router, const std:
     one->reported = true;
 }
 
-static uint32_t address_order(const std::string &address) {
+uint32_t address_order(const std::string &address) {
     in_addr parsed = {};
     return inet_pton(AF_INET, address.c_str(), &parsed) == 1 ? ntohl(parsed.s_addr) : 0;
 }
 
-static bool gather_routers(gathering *work, snapshot_group *group,
-                           const std::vector<std::string> &configured) {
+bool gather_routers(gathering *work, snapshot_group *group, const std::vector<std::string> &configured) {
     ctl_reply reply;
     const std::string root = group_root(NODE_GROUP_STATE, group->id) + "/router";
     if (group->running && !work->ask_wccpd(ctl_walk::subtree, root, &reply))
@@ -244,7 +243,7 @@ static bool gather_routers(gathering *work, snapshot_group *group,
     return true;
 }
 
-static bool gather_weights(gathering *work, snapshot_group *group, uint32_t count) {
+bool gather_weights(gathering *work, snapshot_group *group, uint32_t count) {
     const ctl_ask ask = [work](ctl_walk walk, const std::string &name, ctl_reply *out) {
         return work->ask_wccpd(walk, name, out);
     };
@@ -264,7 +263,7 @@ static bool gather_weights(gathering *work, snapshot_group *group, uint32_t coun
 }
 
 // Where the designated appliance doesn't tell what it allots, the weights do.
-static void finish_shares(snapshot_group *group) {
+void finish_shares(snapshot_group *group) {
     int64_t sum = 0;
     bool known = !group->appliances.empty();
     for (const snapshot_appliance &one : group->appliances) {
@@ -277,7 +276,7 @@ static void finish_shares(snapshot_group *group) {
 }
 
 // By address: an appliance keeps its letter and its place while others come and go.
-static void sort_appliances(snapshot_group *group) {
+void sort_appliances(snapshot_group *group) {
     std::vector<snapshot_appliance> sorted = group->appliances;
     std::sort(sorted.begin(), sorted.end(), [](const auto &a, const auto &b) {
         return address_order(a.address) < address_order(b.address);
@@ -293,15 +292,13 @@ static void sort_appliances(snapshot_group *group) {
     renumber(&group->wanted);
 }
 
-namespace {
 struct group_texts {
     std::string group, assignment;
     uint32_t appliances = 0;
 };
-} // namespace
 
-static void take_group_nodes(const std::string &root, const ctl_reply &reply, snapshot_group *group,
-                             group_texts *out) {
+void take_group_nodes(const std::string &root, const ctl_reply &reply, snapshot_group *group,
+                      group_texts *out) {
     for (const ctl_binding &binding : reply.bindings) {
         const std::vector<std::string> parts = parts_below(root, binding.name);
         if (parts.size() != 1)
@@ -316,7 +313,7 @@ static void take_group_nodes(const std::string &root, const ctl_reply &reply, sn
     }
 }
 
-static bool gather_briefly(gathering *work, snapshot_group *group, const std::string &root) {
+bool gather_briefly(gathering *work, snapshot_group *group, const std::string &root) {
     ctl_reply reply;
     group_texts unused;
     for (const char *node : {"/oper", "/uptime", "/app_id", "/num_routers"}) {
@@ -337,7 +334,7 @@ static bool gather_briefly(gathering *work, snapshot_group *group, const std::st
 }
 
 // How many Here-I-Am no router answers.
-static bool gather_sent(gathering *work, snapshot_group *group, const std::string &root) {
+bool gather_sent(gathering *work, snapshot_group *group, const std::string &root) {
     ctl_reply reply;
     const bool silent =
         std::any_of(group->routers.begin(), group->routers.end(),
@@ -352,7 +349,7 @@ static bool gather_sent(gathering *work, snapshot_group *group, const std::strin
 }
 
 // A table is shown by the method that was agreed. What a router reports by another one is not what it shows.
-static void drop_misread_tables(snapshot_group *group) {
+void drop_misread_tables(snapshot_group *group) {
     for (const snapshot_reason &reason : group->reasons)
         if (reason.code == "method-differs" && reason.offered.ends_with(" by the router"))
             for (snapshot_table &table : group->tables)
@@ -360,7 +357,7 @@ static void drop_misread_tables(snapshot_group *group) {
     std::erase_if(group->tables, [](const snapshot_table &table) { return table.routers.empty(); });
 }
 
-static bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) {
+bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) {
     std::vector<std::string> configured;
     if (group->configured && !gather_config(work, group, &configured))
         return false;
@@ -386,7 +383,7 @@ static bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) 
     return true;
 }
 
-static bool gather_processes(gathering *work) {
+bool gather_processes(gathering *work) {
     ctl_reply reply;
     if (!work->ask(ctl_walk::subtree, NODE_PROCESSES, &reply))
         return false;
@@ -405,7 +402,7 @@ static bool gather_processes(gathering *work) {
     return true;
 }
 
-static bool gather_alarms(gathering *work) {
+bool gather_alarms(gathering *work) {
     ctl_reply reply;
     if (!work->ask(ctl_walk::subtree, NODE_ALARMS_RAISED, &reply))
         return false;
@@ -428,7 +425,7 @@ static bool gather_alarms(gathering *work) {
     return gather_processes(work);
 }
 
-static bool gather_redirected(gathering *work) {
+bool gather_redirected(gathering *work) {
     traffic_state traffic;
     const auto ask = [work](ctl_walk walk, const std::string &name, ctl_reply *out) {
         return work->ask(walk, name, out);
@@ -439,12 +436,12 @@ static bool gather_redirected(gathering *work) {
     return true;
 }
 
-static std::string first_value(const ctl_reply &reply) {
+std::string first_value(const ctl_reply &reply) {
     return reply.bindings.empty() ? "" : clean_text(reply.bindings[0].value, 31);
 }
 
 // The ids of the groups below a root, as they stand in a walk of its children.
-static void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *inout) {
+void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *inout) {
     for (const ctl_binding &binding : reply.bindings) {
         const std::vector<std::string> parts = parts_below(root, binding.name);
         const int id = parts.size() == 1 ? number_of(parts[0], -1) : -1;
@@ -454,7 +451,7 @@ static void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *
     std::sort(inout->begin(), inout->end());
 }
 
-static void gather(gathering *work) {
+void gather(gathering *work) {
     ctl_reply alive, version, mode, states, configs;
     work->shown.wccpd = wccpd_condition::running;
     if (!work->ask(ctl_walk::node, NODE_SYSTEM_MODE, &mode) || !gather_alarms(work) ||
@@ -488,6 +485,8 @@ static void gather(gathering *work) {
         work->shown.groups.push_back(std::move(group));
     }
 }
+
+} // namespace
 
 snapshot gather_snapshot(const snapshot_query &query, const snapshot_limits &limits) {
     gathering work = {query, limits, {}, 0};

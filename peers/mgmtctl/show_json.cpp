@@ -8,14 +8,16 @@
 
 using json = nlohmann::ordered_json;
 
-static json text_or_null(const std::string &text) {
+namespace {
+
+json text_or_null(const std::string &text) {
     return text.empty() ? json(nullptr) : json(text);
 }
-static json number_or_null(int64_t number) {
+json number_or_null(int64_t number) {
     return number < 0 ? json(nullptr) : json(number);
 }
 
-static json router_json(const snapshot_router &router) {
+json router_json(const snapshot_router &router) {
     json shares = json::object();
     for (const snapshot_load &load : router.loads)
         shares[load.appliance] = load.percent;
@@ -30,7 +32,7 @@ static json router_json(const snapshot_router &router) {
             {"shares", shares}};
 }
 
-static json appliance_json(const snapshot_appliance &one) {
+json appliance_json(const snapshot_appliance &one) {
     json out = {{"address", one.address},
                 {"self", one.self},
                 {"weight", number_or_null(one.weight)},
@@ -41,7 +43,7 @@ static json appliance_json(const snapshot_appliance &one) {
 }
 
 // Buckets that follow one another and have one owner are one entry.
-static json table_json(const snapshot_group &group, const snapshot_table &table) {
+json table_json(const snapshot_group &group, const snapshot_table &table) {
     json runs = json::array();
     for (size_t i = 0; i < table.owners.size(); i++) {
         const int owner = table.owners[i];
@@ -55,6 +57,8 @@ static json table_json(const snapshot_group &group, const snapshot_table &table)
     }
     return {{"kind", table.mask ? "mask" : "hash"}, {"routers", table.routers}, {"buckets", runs}};
 }
+
+} // namespace
 
 json reason_json(const reason &one) {
     return {{"reason", one.code},
@@ -70,7 +74,9 @@ json reason_json(const reason &one) {
             {"next", one.next}};
 }
 
-static json group_json(const snapshot_group &group) {
+namespace {
+
+json group_json(const snapshot_group &group) {
     json out = {{"id", group.id},
                 {"configured", group.configured},
                 {"admin", text_or_null(group.admin)},
@@ -100,6 +106,8 @@ static json group_json(const snapshot_group &group) {
     out["wanted_table"] = group.wanted.owners.empty() ? json(nullptr) : table_json(group, group.wanted);
     return out;
 }
+
+} // namespace
 
 std::string draw_json(const snapshot &shown) {
     static const char *const conditions[] = {"running", "silent", "absent"};

@@ -17,25 +17,25 @@
 #include "peers/mgmtctl/show_draw.h"
 #include "peers/mgmtctl/show_words.h"
 
-static constexpr int STRIP_CELLS = 64;
-static constexpr int BAR_CELLS = 20;
-
 namespace {
+
+constexpr int STRIP_CELLS = 64;
+constexpr int BAR_CELLS = 20;
+
 // A line that ends at its last column, whatever is added.
 struct pen {
     const screen_form &form;
     std::string out;
     int used = 0;
 };
-} // namespace
 
-static void set_style(pen *line, const std::string &codes) {
+void set_style(pen *line, const std::string &codes) {
     if (line->form.colour)
         line->out += "\033[" + codes + "m";
 }
 
 // One column wide each; `text` is ASCII.
-static void add_cells(pen *line, const std::string &text, style how = style::plain) {
+void add_cells(pen *line, const std::string &text, style how = style::plain) {
     static const char *const codes[] = {"", "1", "2", "32", "33", "1;31"};
     const char *code = codes[static_cast<int>(how)];
     const auto room = static_cast<size_t>(std::max(line->form.columns - line->used, 0));
@@ -49,7 +49,7 @@ static void add_cells(pen *line, const std::string &text, style how = style::pla
         set_style(line, "0");
 }
 
-static void add_glyph(pen *line, const char *utf8, char ascii) {
+void add_glyph(pen *line, const char *utf8, char ascii) {
     if (line->used >= line->form.columns)
         return;
     if (line->form.utf8)
@@ -59,8 +59,8 @@ static void add_glyph(pen *line, const char *utf8, char ascii) {
     line->used++;
 }
 
-static std::string format(const char *text, ...) __attribute__((format(printf, 1, 2)));
-static std::string format(const char *text, ...) {
+std::string format(const char *text, ...) __attribute__((format(printf, 1, 2)));
+std::string format(const char *text, ...) {
     char buffer[256];
     va_list list;
     va_start(list, text);
@@ -69,14 +69,14 @@ static std::string format(const char *text, ...) {
     return buffer;
 }
 
-static int colour_of(int place) {
+int colour_of(int place) {
     static const int palette[] = {33, 214, 70, 170, 44, 203, 142, 105, 37, 208, 28, 161};
     return place < 0 ? 236 : palette[static_cast<size_t>(place) % std::size(palette)];
 }
 
 // --- One line
 
-static std::string alarm_words(const snapshot_alarm &alarm, const std::vector<reason> &reasons) {
+std::string alarm_words(const snapshot_alarm &alarm, const std::vector<reason> &reasons) {
     const std::string about = alarm.group >= 0 ? "group " + std::to_string(alarm.group) + ": "
                               // A cause without a group names its subject.
                               : alarm_reason(reasons, alarm.group, alarm.name, alarm.source)
@@ -92,7 +92,7 @@ static std::string alarm_words(const snapshot_alarm &alarm, const std::vector<re
     return since.empty() ? text : text + ", since " + since;
 }
 
-static std::string one_line(const snapshot_group &group, bool brief) {
+std::string one_line(const snapshot_group &group, bool brief) {
     const size_t reached = brief ? group.routers_heard : connected_routers(group);
     const size_t all = brief ? std::max(group.routers_configured, reached) : group.routers.size();
     std::string text = "  routers " + std::to_string(reached) + "/" + std::to_string(all);
@@ -106,11 +106,13 @@ static std::string one_line(const snapshot_group &group, bool brief) {
     return text;
 }
 
-static std::string traffic_head(const traffic_state &traffic) {
+std::string traffic_head(const traffic_state &traffic) {
     if (traffic.tunneld != tunneld_condition::running)
         return traffic.tunneld == tunneld_condition::absent ? "tunneld: no session" : "tunneld: no answer";
     return "traffic  data plane " + traffic.plane + "  " + plural_text(traffic.tunnels.size(), "tunnel");
 }
+
+} // namespace
 
 std::vector<std::string> draw_lines(const snapshot &shown) {
     if (!shown.unreachable.empty())
@@ -136,9 +138,10 @@ std::vector<std::string> draw_lines(const snapshot &shown) {
     return out;
 }
 
+namespace {
+
 // --- The screen
 
-namespace {
 struct screen {
     const snapshot &shown;
     const screen_form &form;
@@ -176,9 +179,8 @@ struct screen {
         text(words, how);
     }
 };
-} // namespace
 
-static void draw_head(screen *on, size_t alarms_most) {
+void draw_head(screen *on, size_t alarms_most) {
     const snapshot &shown = on->shown;
     pen line = on->begin();
     if (!shown.unreachable.empty()) {
@@ -213,7 +215,7 @@ static void draw_head(screen *on, size_t alarms_most) {
                  style::bad);
 }
 
-static void draw_group_head(screen *on, const snapshot_group &group) {
+void draw_group_head(screen *on, const snapshot_group &group) {
     pen line = on->begin();
     add_cells(&line, format("%-4d", group.id), style::bold);
     const reason *cause = main_reason(on->reasons, group.id);
@@ -240,7 +242,7 @@ static void draw_group_head(screen *on, const snapshot_group &group) {
     on->paragraph("  > " + cause->next);
 }
 
-static void draw_router(screen *on, const snapshot_group &group, const snapshot_router &router) {
+void draw_router(screen *on, const snapshot_group &group, const snapshot_router &router) {
     const auto method = [](const std::string &word) { return word.empty() ? "-" : word.c_str(); };
     pen line = on->begin();
     add_cells(&line, format("  router %-15s ", router.address.c_str()));
@@ -264,7 +266,7 @@ static void draw_router(screen *on, const snapshot_group &group, const snapshot_
     on->end(&line);
 }
 
-static void draw_bar(pen *line, const snapshot_appliance &one, int place) {
+void draw_bar(pen *line, const snapshot_appliance &one, int place) {
     const int cells = std::clamp(line->form.columns - line->used, 0, BAR_CELLS);
     const int has = static_cast<int>(std::min<uint32_t>(one.least_percent, 100)) * cells;
     const int asked = std::clamp(one.asked_percent, 0, 100) * cells;
@@ -283,7 +285,7 @@ static void draw_bar(pen *line, const snapshot_appliance &one, int place) {
     set_style(line, "0");
 }
 
-static void draw_appliance(screen *on, const snapshot_appliance &one, int place) {
+void draw_appliance(screen *on, const snapshot_appliance &one, int place) {
     pen line = on->begin();
     add_cells(&line, "  ");
     set_style(&line, "1;38;5;" + std::to_string(colour_of(place)));
@@ -299,7 +301,7 @@ static void draw_appliance(screen *on, const snapshot_appliance &one, int place)
     on->end(&line);
 }
 
-static void draw_strip(screen *on, const snapshot_group &group, const snapshot_table &table) {
+void draw_strip(screen *on, const snapshot_group &group, const snapshot_table &table) {
     std::string label = table.mask ? "mask" : "hash";
     if (group.tables.size() > 1) // which of them
         label = table.routers[0] + (table.routers.size() > 1 ? " .." : "");
@@ -328,7 +330,7 @@ static void draw_strip(screen *on, const snapshot_group &group, const snapshot_t
 
 // The places of up to `most` entries, those for which `first` holds before the others.
 template <typename Entry, typename First>
-static std::vector<size_t> chosen(const std::vector<Entry> &all, size_t most, First first) {
+std::vector<size_t> chosen(const std::vector<Entry> &all, size_t most, First first) {
     std::vector<size_t> out;
     for (const bool wanted : {true, false})
         for (size_t i = 0; i < all.size() && out.size() < most; i++)
@@ -339,12 +341,12 @@ static std::vector<size_t> chosen(const std::vector<Entry> &all, size_t most, Fi
     return out;
 }
 
-static void draw_more(screen *on, size_t all, size_t most, const char *what) {
+void draw_more(screen *on, size_t all, size_t most, const char *what) {
     if (all > most)
         on->text("  and " + plural_text(all - most, what) + " more", style::dim);
 }
 
-static void draw_group(screen *on, const snapshot_group &group, size_t most) {
+void draw_group(screen *on, const snapshot_group &group, size_t most) {
     draw_group_head(on, group);
     for (const size_t i :
          chosen(group.routers, most, [](const auto &r) { return r.connection != "two-way"; }))
@@ -358,13 +360,13 @@ static void draw_group(screen *on, const snapshot_group &group, size_t most) {
     draw_more(on, group.tables.size(), most, "table");
 }
 
-static void draw_reasons(screen *on, const std::vector<traffic_reason> &reasons, size_t most) {
+void draw_reasons(screen *on, const std::vector<traffic_reason> &reasons, size_t most) {
     for (size_t i = 0; i < std::min(reasons.size(), most); i++)
         on->paragraph("  " + reasons[i].text, style::warn);
     draw_more(on, reasons.size(), most, "note");
 }
 
-static void draw_traffic(screen *on, size_t most) {
+void draw_traffic(screen *on, size_t most) {
     const traffic_state &traffic = on->shown.traffic;
     on->text(traffic_head(traffic), style::bold);
     for (const size_t i :
@@ -383,7 +385,7 @@ static void draw_traffic(screen *on, size_t most) {
     draw_reasons(on, traffic_reasons(traffic), most);
 }
 
-static std::vector<std::string> draw_whole(const snapshot &shown, const screen_form &form, size_t most) {
+std::vector<std::string> draw_whole(const snapshot &shown, const screen_form &form, size_t most) {
     screen on = {shown, form, {}, reasons_of(shown)};
     draw_head(&on, most);
     for (const snapshot_group &group : shown.groups) {
@@ -400,7 +402,7 @@ static std::vector<std::string> draw_whole(const snapshot &shown, const screen_f
     return std::move(on.lines);
 }
 
-static std::vector<std::string> draw_briefly(const snapshot &shown, const screen_form &form) {
+std::vector<std::string> draw_briefly(const snapshot &shown, const screen_form &form) {
     screen on = {shown, form, {}, reasons_of(shown)};
     draw_head(&on, 3);
     if (shown.unreachable.empty() && shown.traffic.tunneld != tunneld_condition::running)
@@ -427,6 +429,8 @@ static std::vector<std::string> draw_briefly(const snapshot &shown, const screen
         on.text("and " + plural_text(shown.groups_total - drawn, "group") + " not shown", style::dim);
     return std::move(on.lines);
 }
+
+} // namespace
 
 std::vector<std::string> draw_screen(const snapshot &shown, const screen_form &form) {
     if (!shown.brief)

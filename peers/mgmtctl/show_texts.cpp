@@ -16,17 +16,17 @@
 
 #include "peers/mgmtctl/show_texts.h"
 
-static constexpr size_t LINES_MAX = 8192;
-static constexpr size_t TABLES_MAX = 32; // of different routers
-static constexpr size_t BUCKETS = 256;
-
 namespace {
+
+constexpr size_t LINES_MAX = 8192;
+constexpr size_t TABLES_MAX = 32; // of different routers
+constexpr size_t BUCKETS = 256;
+
 struct dump_row {
     std::string_view label, value;
 };
-} // namespace
 
-static std::string_view trimmed(std::string_view text) {
+std::string_view trimmed(std::string_view text) {
     const size_t first = text.find_first_not_of(" \t");
     if (first == std::string_view::npos)
         return {};
@@ -34,7 +34,7 @@ static std::string_view trimmed(std::string_view text) {
 }
 
 template <typename Take>
-static void each_row(std::string_view text, Take take) {
+void each_row(std::string_view text, Take take) {
     for (size_t lines = 0; !text.empty() && lines < LINES_MAX; lines++) {
         const size_t end = text.find('\n');
         const std::string_view line = text.substr(0, end);
@@ -47,16 +47,15 @@ static void each_row(std::string_view text, Take take) {
     }
 }
 
-static std::string address_in(std::string_view value) {
+std::string address_in(std::string_view value) {
     return clean_text(std::string(value), 15);
 }
 
-static bool words_in(std::string_view value, uint32_t *out) {
+bool words_in(std::string_view value, uint32_t *out) {
     const std::string text(value.substr(0, 64));
     return sscanf(text.c_str(), "0x%8x %8x %8x %8x", &out[0], &out[1], &out[2], &out[3]) == 4;
 }
 
-namespace {
 struct assignment_reader {
     snapshot_group *group;
     bool routers = false; // in the part of what they report
@@ -67,9 +66,8 @@ struct assignment_reader {
     bool mask = false;
     std::map<std::string, snapshot_table> tables; // by router
 };
-} // namespace
 
-static void put_words(assignment_reader *in, const uint32_t *words) {
+void put_words(assignment_reader *in, const uint32_t *words) {
     if (in->place < 0 || (in->tables.size() >= TABLES_MAX && !in->tables.contains(in->router)))
         return;
     snapshot_table *table = &in->tables[in->router];
@@ -82,7 +80,7 @@ static void put_words(assignment_reader *in, const uint32_t *words) {
     }
 }
 
-static void put_wanted_words(assignment_reader *in, const uint32_t *words) {
+void put_wanted_words(assignment_reader *in, const uint32_t *words) {
     in->group->wanted.owners.resize(BUCKETS, -1);
     for (size_t i = 0; i < 128; i++)
         if (words[3 - i / 32] >> i % 32 & 1)
@@ -90,7 +88,7 @@ static void put_wanted_words(assignment_reader *in, const uint32_t *words) {
 }
 
 // A value of the designated appliance's mask table, and its owner. The values come in their order.
-static bool take_wanted_value(assignment_reader *in, const dump_row &row) {
+bool take_wanted_value(assignment_reader *in, const dump_row &row) {
     snapshot_table *wanted = &in->group->wanted;
     char owner[16];
     if (in->routers || wanted->owners.size() >= BUCKETS ||
@@ -104,7 +102,7 @@ static bool take_wanted_value(assignment_reader *in, const dump_row &row) {
     return true;
 }
 
-static void take_row(assignment_reader *in, const dump_row &row) {
+void take_row(assignment_reader *in, const dump_row &row) {
     uint32_t words[4];
     if (take_wanted_value(in, row))
         return;
@@ -134,13 +132,13 @@ static void take_row(assignment_reader *in, const dump_row &row) {
     }
 }
 
-static bool has_owner(const snapshot_table &table) {
+bool has_owner(const snapshot_table &table) {
     return std::any_of(table.owners.begin(), table.owners.end(), [](int owner) { return owner >= 0; });
 }
 
 // A mask table has as many values as the wanted one. Where that is unknown, it ends at the last value that
 // has an owner, at a power of two.
-static void finish_table(const snapshot_table &wanted, snapshot_table *table) {
+void finish_table(const snapshot_table &wanted, snapshot_table *table) {
     if (!table->mask)
         return;
     if (wanted.mask && !wanted.owners.empty()) {
@@ -152,6 +150,8 @@ static void finish_table(const snapshot_table &wanted, snapshot_table *table) {
         count--;
     table->owners.resize(std::bit_ceil(count));
 }
+
+} // namespace
 
 void take_assignment_text(const std::string &text, snapshot_group *inout) {
     assignment_reader in = {.group = inout, .router = {}, .tables = {}};
