@@ -10,7 +10,8 @@
 #include <unistd.h>
 
 namespace {
-// The new file, until it has the name of the old one.
+
+// The new file, until it is renamed to the name of the old one.
 struct unfinished_page {
     std::string path;
     int fd;
@@ -22,12 +23,11 @@ struct unfinished_page {
         if (fd < 0)
             return;
         close(fd);
-        unlink(path.c_str()); // nothing, once it was renamed
+        unlink(path.c_str()); // fails after the rename
     }
 };
-} // namespace
 
-static bool write_content(int fd, const std::string &content) {
+bool write_content(int fd, const std::string &content) {
     for (size_t done = 0; done < content.size();) {
         const ssize_t wrote = write(fd, content.data() + done, content.size() - done);
         if (wrote < 0 && errno != EINTR)
@@ -37,11 +37,13 @@ static bool write_content(int fd, const std::string &content) {
     return fsync(fd) == 0;
 }
 
-static mode_t mode_of_new_file() {
+mode_t mode_of_new_file() {
     const mode_t mask = umask(0);
     umask(mask);
     return 0666 & ~mask;
 }
+
+} // namespace
 
 bool write_page_file(const std::string &path, const std::string &content, std::string *out_reason) {
     const std::unique_ptr<char, decltype(&free)> found(realpath(path.c_str(), nullptr), free);

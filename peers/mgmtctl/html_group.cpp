@@ -1,19 +1,23 @@
-// One group of the page: its state in the line that stays when it is folded up, below it the reasons,
-// routers, appliances, and the table that each router has beside the one that is wanted.
+// One group of the page: a summary line, which remains when the group is folded; then its reasons, routers,
+// appliances, and the table of each router beside the wanted one.
 #include "peers/mgmtctl/html_parts.h"
 
 #include <algorithm>
 #include <numeric>
 
-static constexpr size_t CELLS = 32;        // of a line of a strip
-static constexpr size_t FEW_GROUPS = 4;    // none is folded up
-static constexpr size_t NAMED_ROUTERS = 4; // of a strip; further ones are counted
+namespace {
 
-// --- What the routers have, compared with what is wanted
+constexpr size_t CELLS = 32;        // in each line of a strip
+constexpr size_t FEW_GROUPS = 4;    // with so few, none is folded
+constexpr size_t NAMED_ROUTERS = 4; // in the caption of a strip; the others are counted
 
-static int owner_at(const snapshot_table &table, size_t bucket) {
+// --- Tables of the routers, compared with the wanted one
+
+int owner_at(const snapshot_table &table, size_t bucket) {
     return bucket < table.owners.size() ? table.owners[bucket] : -1;
 }
+
+} // namespace
 
 size_t differing_buckets(const snapshot_table &wanted, const snapshot_table &found) {
     size_t count = 0;
@@ -22,31 +26,37 @@ size_t differing_buckets(const snapshot_table &wanted, const snapshot_table &fou
     return count;
 }
 
-static bool table_differs(const snapshot_group &group) {
+namespace {
+
+bool table_differs(const snapshot_group &group) {
     return !group.wanted.owners.empty() &&
            std::any_of(group.tables.begin(), group.tables.end(), [&](const snapshot_table &table) {
                return differing_buckets(group.wanted, table) > 0;
            });
 }
 
+} // namespace
+
 bool needs_attention(const html_view &view, const snapshot_group &group) {
     return main_reason(view.reasons, group.id) || is_in_alarm(view.shown, group) || table_differs(group);
 }
 
-static const char *bucket_word(const snapshot_table &table) {
+namespace {
+
+const char *bucket_word(const snapshot_table &table) {
     return table.mask ? "value" : "bucket";
 }
 
 // --- A strip
 
-static std::string owner_words(const snapshot_group &group, int owner) {
+std::string owner_words(const snapshot_group &group, int owner) {
     return owner < 0 ? "nobody"
                      : std::string(1, appliance_letter(owner)) + " " +
                            group.appliances[static_cast<size_t>(owner)].address;
 }
 
-// "A 64, B 188, nobody 4": also for those who cannot see the cells.
-static std::string counts_text(const snapshot_table &table) {
+// "A 64, B 188, nobody 4": also read aloud to those who cannot see the cells.
+std::string counts_text(const snapshot_table &table) {
     std::string out;
     const auto add = [&](int owner, const std::string &name) {
         if (const auto count = std::count(table.owners.begin(), table.owners.end(), owner); count > 0)
@@ -58,6 +68,8 @@ static std::string counts_text(const snapshot_table &table) {
     add(-1, "nobody");
     return out;
 }
+
+} // namespace
 
 void add_strip(std::string *out, const html_view &view, const snapshot_group &group,
                const snapshot_table &table) {
@@ -95,15 +107,17 @@ void add_strip(std::string *out, const html_view &view, const snapshot_group &gr
     add_html(out, "</div>");
 }
 
-static std::string routers_text(const std::vector<std::string> &routers, size_t most) {
+namespace {
+
+std::string routers_text(const std::vector<std::string> &routers, size_t most) {
     std::string out;
     for (size_t i = 0; i < std::min(routers.size(), most); i++)
         out += (i == 0 ? "" : ", ") + routers[i];
     return routers.size() <= most ? out : out + " and " + std::to_string(routers.size() - most) + " more";
 }
 
-// Those that differ most first: beside the wanted one.
-static std::vector<size_t> order_of_tables(const snapshot_group &group) {
+// Tables that differ most come first, beside the wanted one.
+std::vector<size_t> order_of_tables(const snapshot_group &group) {
     std::vector<size_t> out(group.tables.size());
     std::iota(out.begin(), out.end(), size_t{0});
     if (!group.wanted.owners.empty())
@@ -114,34 +128,34 @@ static std::vector<size_t> order_of_tables(const snapshot_group &group) {
     return out;
 }
 
-static html_markup table_state(const snapshot_group &group, size_t place) {
+html_markup table_state(const snapshot_group &group, size_t place) {
     if (group.wanted.owners.empty())
         return group.tables.size() == 1 ? html_of("reported")
-                                        : badge(style::warn, "table " + std::to_string(place + 1));
+                                        : make_badge(style::warn, "table " + std::to_string(place + 1));
     const size_t differing = differing_buckets(group.wanted, group.tables[place]);
-    return differing == 0 ? badge(style::good, "as wanted")
-                          : badge(style::bad, plural_text(differing, bucket_word(group.tables[place])) +
-                                                  " not as wanted");
+    return differing == 0 ? make_badge(style::good, "as wanted")
+                          : make_badge(style::bad, plural_text(differing, bucket_word(group.tables[place])) +
+                                                       " not as wanted");
 }
 
-static void add_wanted_strip(std::string *out, const html_view &view, const snapshot_group &group) {
+void add_wanted_strip(std::string *out, const html_view &view, const snapshot_group &group) {
     add_html(out, "<figure><figcaption><b>Wanted</b> ");
     if (!group.wanted.owners.empty()) {
         add_html(out, "by this appliance, the designated one <small>", counts_text(group.wanted),
                  "</small></figcaption>\n");
         add_strip(out, view, group, group.wanted);
     } else if (!group.running) {
-        add_html(out, unknown(), "</figcaption>");
+        add_html(out, unknown_badge(), "</figcaption>");
     } else {
-        add_html(out, unknown(), "<small>",
+        add_html(out, unknown_badge(), "<small>",
                  group.designated ? "this appliance, the designated one, has computed no table yet"
-                                  : "only the designated appliance knows it, and has it on its page",
+                                  : "only the designated appliance knows it; see its page",
                  "</small></figcaption>");
     }
     add_html(out, "</figure>\n");
 }
 
-static void add_strips(std::string *out, const html_view &view, const snapshot_group &group) {
+void add_strips(std::string *out, const html_view &view, const snapshot_group &group) {
     const snapshot_table *any = !group.wanted.owners.empty() ? &group.wanted
                                 : !group.tables.empty()      ? &group.tables[0]
                                                              : nullptr;
@@ -162,27 +176,28 @@ static void add_strips(std::string *out, const html_view &view, const snapshot_g
     }
     if (group.tables.empty())
         add_html(out, "<figure><figcaption><b>Routers</b> ",
-                 group.running ? html_of("<span class=\"dim\">none has reported a table</span>") : unknown(),
+                 group.running ? html_of("<span class=\"dim\">none has reported a table</span>")
+                               : unknown_badge(),
                  "</figcaption></figure>\n");
     add_html(out, "</div>\n");
 }
 
 // --- Routers and appliances
 
-static html_markup connection_badge(const snapshot_group &group, const snapshot_router &router) {
+html_markup connection_badge(const snapshot_group &group, const snapshot_router &router) {
     if (router.connection == "two-way")
-        return badge(style::good, "two-way");
+        return make_badge(style::good, "two-way");
     if (router.connection == "one-way")
-        return badge(style::warn, "one-way");
+        return make_badge(style::warn, "one-way");
     if (router.connection != "none")
-        return unknown();
+        return unknown_badge();
     const auto noted = std::find_if(group.reasons.begin(), group.reasons.end(), [&](const auto &each) {
         return each.sender == router.address && each.count;
     });
-    return badge(style::bad, noted == group.reasons.end() ? "nothing heard" : noted->code);
+    return make_badge(style::bad, noted == group.reasons.end() ? "nothing heard" : noted->code);
 }
 
-static html_markup table_badge(const snapshot_group &group, const snapshot_router &router) {
+html_markup table_badge(const snapshot_group &group, const snapshot_router &router) {
     const auto table =
         std::find_if(group.tables.begin(), group.tables.end(), [&](const snapshot_table &each) {
             return std::find(each.routers.begin(), each.routers.end(), router.id) != each.routers.end();
@@ -191,16 +206,16 @@ static html_markup table_badge(const snapshot_group &group, const snapshot_route
         return each.code == "method-differs" && (each.sender == router.id || each.sender == router.address);
     });
     if (table == group.tables.end() && misread)
-        return badge(style::warn, "by another method");
+        return make_badge(style::warn, "by another method");
     if (table == group.tables.end())
         return router.connection == "none" ? html_of("<span class=\"dim\">-</span>")
                : group.running && router.connection != "unknown"
                    ? html_of("<span class=\"dim\">none reported</span>")
-                   : unknown();
+                   : unknown_badge();
     return table_state(group, static_cast<size_t>(table - group.tables.begin()));
 }
 
-static void add_router(std::string *out, const snapshot_group &group, const snapshot_router &router) {
+void add_router(std::string *out, const snapshot_group &group, const snapshot_router &router) {
     const bool heard = router.connection == "two-way" || router.connection == "one-way";
     const auto method = [&](const std::string &word) {
         return !word.empty() ? html_of(word)
@@ -221,7 +236,7 @@ static void add_router(std::string *out, const snapshot_group &group, const snap
              "</td><td>", table_badge(group, router), "</td></tr>\n");
 }
 
-static void add_appliance(std::string *out, const snapshot_group &group, size_t place) {
+void add_appliance(std::string *out, const snapshot_group &group, size_t place) {
     const snapshot_appliance &one = group.appliances[place];
     const size_t colour = place % PAGE_COLOURS;
     const bool wanted = one.asked_percent >= 0;
@@ -233,12 +248,12 @@ static void add_appliance(std::string *out, const snapshot_group &group, size_t 
         add_html(out, " <b>this appliance</b>");
     if (one.self && group.designated)
         add_html(out, " <span class=\"dim\">designated</span>");
-    add_html(out, "</td><td>", one.weight < 0 ? unknown() : html_of(one.weight), "</td><td>",
-             wanted ? html_of(one.asked_percent, "%") : unknown(), "</td><td>");
+    add_html(out, "</td><td>", one.weight < 0 ? unknown_badge() : html_of(one.weight), "</td><td>",
+             wanted ? html_of(one.asked_percent, "%") : unknown_badge(), "</td><td>");
     if (!one.reported)
         add_html(out, "<span class=\"dim\">not reported</span>");
     else if (short_of)
-        add_html(out, badge(style::warn, share_words(one)));
+        add_html(out, make_badge(style::warn, share_words(one)));
     else
         add_html(out, share_words(one));
     add_html(out, "</td><td><span class=\"bar o", colour, "\" role=\"img\" aria-label=\"has ",
@@ -251,7 +266,7 @@ static void add_appliance(std::string *out, const snapshot_group &group, size_t 
 
 // --- The whole
 
-static void add_facts(std::string *out, const snapshot_group &group) {
+void add_facts(std::string *out, const snapshot_group &group) {
     const auto fact = [&](const char *name, const std::string &value) {
         if (!value.empty())
             add_html(out, "<li><span class=\"dim\">", name, "</span> ", value, "</li>");
@@ -274,33 +289,33 @@ static void add_facts(std::string *out, const snapshot_group &group) {
     add_html(out, "</ul>\n");
 }
 
-static const traffic_intercept *intercept_of(const html_view &view, int group) {
+const traffic_intercept *intercept_of(const html_view &view, int group) {
     for (const traffic_intercept &each : view.shown.traffic.intercepts)
         if (each.group == group)
             return &each;
     return nullptr;
 }
 
-static style proxy_style(const traffic_intercept &intercept) {
+style proxy_style(const traffic_intercept &intercept) {
     return intercept.proxy == "up" ? style::good : intercept.proxy == "down" ? style::bad : style::warn;
 }
 
-static void add_summary(std::string *out, const html_view &view, const snapshot_group &group) {
+void add_summary(std::string *out, const html_view &view, const snapshot_group &group) {
     const reason *cause = main_reason(view.reasons, group.id);
     const auto [words, how] = group_state_words(view.shown, group, cause != nullptr);
     const bool silent =
         !group.running && view.shown.wccpd != wccpd_condition::running && group.admin != "down";
     add_html(out, "<summary><span class=\"id\">Group ", group.id, "</span> ",
              silent ? html_of("<span class=\"badge unknown\"><span>?</span> state unknown</span>")
-                    : badge(how, words));
+                    : make_badge(how, words));
     if (cause)
         add_html(out, " <code>", cause->code, "</code>");
     else if (is_in_alarm(view.shown, group))
-        add_html(out, " ", badge(style::bad, "in alarm"));
+        add_html(out, " ", make_badge(style::bad, "in alarm"));
     else if (table_differs(group))
-        add_html(out, " ", badge(style::bad, "table not as wanted"));
+        add_html(out, " ", make_badge(style::bad, "table not as wanted"));
     if (const traffic_intercept *intercept = intercept_of(view, group.id))
-        add_html(out, " ", badge(proxy_style(*intercept), "proxy " + intercept->proxy));
+        add_html(out, " ", make_badge(proxy_style(*intercept), "proxy " + intercept->proxy));
     add_html(out, "<span class=\"sum\">");
     if (!silent) {
         add_html(out, "routers ", connected_routers(group), "/", group.routers.size());
@@ -312,22 +327,24 @@ static void add_summary(std::string *out, const html_view &view, const snapshot_
     add_html(out, "</span></summary>\n");
 }
 
-static void add_group_traffic(std::string *out, const html_view &view, const snapshot_group &group) {
+void add_group_traffic(std::string *out, const html_view &view, const snapshot_group &group) {
     const traffic_state &traffic = view.shown.traffic;
     add_html(out, "<h3>Traffic</h3>");
     const traffic_intercept *intercept = intercept_of(view, group.id);
     if (traffic.tunneld != tunneld_condition::running)
-        add_html(out, "<p>", unknown(), "</p>\n");
+        add_html(out, "<p>", unknown_badge(), "</p>\n");
     else if (!intercept)
         add_html(out, "<p class=\"dim\">no intercept</p>\n");
     else
-        add_html(out, "<p>", proxy_text(*intercept), " \u00b7 ", dotted(sorted_text(intercept->sorted)),
-                 "</p>\n");
+        add_html(out, "<p>", proxy_text(*intercept), " \u00b7 ",
+                 separate_by_dots(sorted_text(intercept->sorted)), "</p>\n");
     for (const protected_group &each : traffic.protection.groups)
         if (each.group == group.id && each.covered)
             add_html(out, "<p class=\"dim\">Flows of other appliances are protected; packets of ", each.slots,
                      " buckets or values are passed on.</p>\n");
 }
+
+} // namespace
 
 void add_group(std::string *out, const html_view &view, const snapshot_group &group) {
     const bool open = needs_attention(view, group) || view.shown.groups.size() <= FEW_GROUPS;
@@ -352,7 +369,7 @@ void add_group(std::string *out, const html_view &view, const snapshot_group &gr
     add_html(out, "<h3>Appliances</h3>");
     if (group.appliances.empty()) {
         add_html(out, "<p>",
-                 group.running ? html_of("<span class=\"dim\">none in the view yet</span>") : unknown(),
+                 group.running ? html_of("<span class=\"dim\">none in the view yet</span>") : unknown_badge(),
                  "</p>\n");
     } else {
         open_table(out, "appliances");

@@ -4,23 +4,23 @@
 
 #include "peers/mgmtctl/html_parts.h"
 
-static constexpr size_t EACH_BUCKET_GROUPS = 16; // from more groups on, a run of buckets has one title
-static constexpr size_t LISTED_REASONS = 24;     // before the groups; all of them are there
+namespace {
+
+constexpr size_t EACH_BUCKET_GROUPS = 16; // with more groups, a run of buckets has one title
+constexpr size_t LISTED_REASONS = 24;     // above the groups, whose cards list all of them
 
 // --- The headline
 
-namespace {
 struct headline {
     style how;
     std::string title, detail;
 };
-} // namespace
 
-static bool is_running(const snapshot &shown) {
+bool is_running(const snapshot &shown) {
     return shown.wccpd == wccpd_condition::running;
 }
 
-static std::vector<const snapshot_group *> groups_in_need(const html_view &view, bool wanted) {
+std::vector<const snapshot_group *> groups_in_need(const html_view &view, bool wanted) {
     std::vector<const snapshot_group *> out;
     for (const snapshot_group &group : view.shown.groups)
         if (needs_attention(view, group) == wanted)
@@ -28,7 +28,7 @@ static std::vector<const snapshot_group *> groups_in_need(const html_view &view,
     return out;
 }
 
-static headline headline_of(const html_view &view) {
+headline headline_of(const html_view &view) {
     const snapshot &shown = view.shown;
     if (!shown.unreachable.empty())
         return {style::bad, "mgmtd does not answer",
@@ -61,7 +61,7 @@ static headline headline_of(const html_view &view) {
     return {style::good, "Nothing needs attention", group_counts(shown)};
 }
 
-static void add_head(std::string *out, const html_view &view, const headline &head) {
+void add_head(std::string *out, const html_view &view, const headline &head) {
     const page_origin &origin = view.origin;
     add_html(out, "<p class=\"made\">WCCP appliance <b>", origin.host, "</b> \u00b7 ", origin.made,
              " \u00b7 mgmtctl ", origin.version);
@@ -74,18 +74,18 @@ static void add_head(std::string *out, const html_view &view, const headline &he
 
 // --- Numbers at a glance
 
-static void add_tile(std::string *out, const char *name, const html_markup &value, const std::string &below) {
+void add_tile(std::string *out, const char *name, const html_markup &value, const std::string &below) {
     add_html(out, "<div><dt>", name, "</dt><dd>", value);
     if (!below.empty())
         add_html(out, "<small>", below, "</small>");
     add_html(out, "</dd></div>\n");
 }
 
-static std::string part_text(size_t part, size_t whole) {
+std::string part_text(size_t part, size_t whole) {
     return std::to_string(part) + " of " + std::to_string(whole);
 }
 
-static void add_group_tiles(std::string *out, const snapshot &shown) {
+void add_group_tiles(std::string *out, const snapshot &shown) {
     size_t routers = 0, connected = 0;
     for (const snapshot_group &group : shown.groups) {
         routers += group.routers.size();
@@ -95,16 +95,16 @@ static void add_group_tiles(std::string *out, const snapshot &shown) {
     const size_t colon = counts.find(": ");
     add_tile(out, "Groups", html_of(shown.groups_total),
              colon == std::string::npos ? "" : counts.substr(colon + 2));
-    add_tile(out, "Routers", is_running(shown) ? html_of(part_text(connected, routers)) : unknown(),
+    add_tile(out, "Routers", is_running(shown) ? html_of(part_text(connected, routers)) : unknown_badge(),
              "two-way");
     add_tile(out, "Alarms",
-             shown.alarms_total == 0 && !is_running(shown) ? unknown()
+             shown.alarms_total == 0 && !is_running(shown) ? unknown_badge()
              : shown.alarms_total == 0                     ? html_of("none")
                                        : html_of(symbol_of(style::bad), " ", shown.alarms_total),
              "");
 }
 
-static void add_traffic_tiles(std::string *out, const traffic_state &traffic) {
+void add_traffic_tiles(std::string *out, const traffic_state &traffic) {
     const bool running = traffic.tunneld == tunneld_condition::running;
     size_t up = 0;
     int64_t flows = 0;
@@ -114,14 +114,15 @@ static void add_traffic_tiles(std::string *out, const traffic_state &traffic) {
         flows += std::max<int64_t>(each.flows, 0);
         counted = counted && each.flows >= 0;
     }
-    add_tile(out, "Proxies", running ? html_of(part_text(up, traffic.intercepts.size())) : unknown(), "up");
-    add_tile(out, "Flows", counted ? html_of(flows) : unknown(), "of proxies");
-    add_tile(out, "Tunnels", running ? html_of(traffic.tunnels.size()) : unknown(),
-             running ? "data plane " + traffic.plane : "");
+    add_tile(out, "Proxies", running ? html_of(part_text(up, traffic.intercepts.size())) : unknown_badge(),
+             "up");
+    add_tile(out, "Flows", counted ? html_of(flows) : unknown_badge(), "of proxies");
+    add_tile(out, "Tunnels", running ? html_of(traffic.tunnels.size()) : unknown_badge(),
+             running ? traffic.plane + " plane" : "");
 }
 
-static void add_tiles(std::string *out, const snapshot &shown) {
-    const std::string wccpd = is_running(shown) ? shown.status.empty() ? "runs" : shown.status
+void add_tiles(std::string *out, const snapshot &shown) {
+    const std::string wccpd = is_running(shown) ? shown.status.empty() ? "running" : shown.status
                               : shown.wccpd == wccpd_condition::absent ? "not running"
                                                                        : "no answer";
     const bool tunneld = shown.traffic.tunneld == tunneld_condition::running;
@@ -130,7 +131,7 @@ static void add_tiles(std::string *out, const snapshot &shown) {
              shown.version);
     add_tile(out, "tunneld",
              tunneld
-                 ? html_of("runs")
+                 ? html_of("running")
                  : html_of(symbol_of(style::bad), " ",
                            shown.traffic.tunneld == tunneld_condition::absent ? "no session" : "no answer"),
              "");
@@ -141,8 +142,9 @@ static void add_tiles(std::string *out, const snapshot &shown) {
 
 // --- Reasons and alarms
 
-// Of the appliance as a whole, and of all groups where there are several: one alone has its own in its card.
-static void add_attention(std::string *out, const html_view &view) {
+// Reasons of the appliance as a whole and, if several groups need attention, of all groups. A single group
+// shows its own in its card.
+void add_attention(std::string *out, const html_view &view) {
     const bool several = groups_in_need(view, true).size() > 1;
     size_t count = 0;
     for (const reason &each : view.reasons) {
@@ -156,7 +158,7 @@ static void add_attention(std::string *out, const html_view &view) {
         add_html(out, "<p class=\"dim\">and ", count - LISTED_REASONS, " more, with their groups</p>\n");
 }
 
-static void add_alarms(std::string *out, const html_view &view) {
+void add_alarms(std::string *out, const html_view &view) {
     const snapshot &shown = view.shown;
     if (shown.alarms.empty())
         return;
@@ -164,7 +166,7 @@ static void add_alarms(std::string *out, const html_view &view) {
     open_table(out, "alarms");
     for (const snapshot_alarm &alarm : shown.alarms) {
         add_html(out, "<tr><td>",
-                 badge(style::bad, alarm.name.empty() ? std::to_string(alarm.type) : alarm.name),
+                 make_badge(style::bad, alarm.name.empty() ? std::to_string(alarm.type) : alarm.name),
                  "</td><td>");
         if (alarm.group >= 0)
             add_html(out, "<a href=\"#group-", alarm.group, "\">", alarm.group, "</a>");
@@ -183,7 +185,7 @@ static void add_alarms(std::string *out, const html_view &view) {
 
 // --- Groups and legend
 
-static void add_groups(std::string *out, const html_view &view) {
+void add_groups(std::string *out, const html_view &view) {
     const auto needing = groups_in_need(view, true), others = groups_in_need(view, false);
     if (!needing.empty())
         add_html(out, "<h2>", needing.size() == 1 ? "Group that needs" : "Groups that need",
@@ -195,29 +197,31 @@ static void add_groups(std::string *out, const html_view &view) {
     for (const snapshot_group *group : others)
         add_group(out, view, *group);
     if (view.shown.groups.size() < view.shown.groups_total)
-        add_html(out, "<p>",
-                 badge(style::warn, plural_text(view.shown.groups_total - view.shown.groups.size(), "group") +
+        add_html(
+            out, "<p>",
+            make_badge(style::warn, plural_text(view.shown.groups_total - view.shown.groups.size(), "group") +
                                         " not shown"),
-                 " gathering them would take too many queries</p>\n");
+            " gathering them would take too many queries</p>\n");
 }
 
-static void add_legend(std::string *out) {
+void add_legend(std::string *out) {
     const auto cell = [](const char *classes, const char *letter) {
         return html_of("<span class=\"cells\"><b class=\"", classes, "\"><i>", letter, "</i></b></span>");
     };
     add_html(out, "<h2>Legend</h2>\n<div class=\"card legend\">\n<p>", cell("o0", "A"), cell("o1", "B"),
-             "<span>the bucket, or value of the mask, is that of appliance A, B</span></p>\n<p>",
-             cell("none", "-"), "<span>it is nobody's: routers do not redirect it</span></p>\n<p>",
-             cell("o1 other", "B"),
-             "<span>framed and underlined: the router has it otherwise than wanted</span></p>\n<p>"
+             "<span>the bucket or mask value belongs to appliance A, B</span></p>\n<p>", cell("none", "-"),
+             "<span>no owner: routers do not redirect it</span></p>\n<p>", cell("o1 other", "B"),
+             "<span>framed and underlined: the router's owner is not the wanted one</span></p>\n<p>"
              "<span class=\"bar o0\" style=\"--has:40%;--wanted:60%\"></span>"
-             "<span>the share that routers report, and a mark at the wanted one</span></p>\n<p>",
-             badge(style::good, "good"), badge(style::warn, "look at it"), badge(style::bad, "fault"),
-             unknown(),
-             "</p>\n<p><span>Wanted is what the designated appliance has sent, or else what the weights "
-             "give. A line of "
-             "buckets begins with the number of its first.</span></p></div>\n");
+             "<span>the share that routers report; the mark is the wanted share</span></p>\n<p>",
+             make_badge(style::good, "good"), make_badge(style::warn, "warning"),
+             make_badge(style::bad, "fault"), unknown_badge(),
+             "</p>\n<p><span>The wanted table is the one that the designated appliance has computed; wanted "
+             "shares follow from it, or else from the weights. Each line begins with the number of its "
+             "first bucket or value.</span></p></div>\n");
 }
+
+} // namespace
 
 std::string draw_page(const snapshot &shown, const page_origin &origin) {
     const std::vector<reason> reasons = reasons_of(shown);

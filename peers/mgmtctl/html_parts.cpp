@@ -29,37 +29,39 @@ void add_escaped(std::string *out, std::string_view text) {
 // --- States
 
 namespace {
+
 struct tone {
     const char *name; // of its class
     const char *symbol;
 };
-} // namespace
 
-static const tone &tone_of(style how) {
+const tone &tone_of(style how) {
     static const tone tones[] = {{"plain", "\u2022"}, {"plain", "\u2022"}, {"dim", "\u2013"},
                                  {"good", "\u2713"},  {"warn", "\u25b2"},  {"bad", "\u2715"}};
     return tones[static_cast<size_t>(how)];
 }
+
+} // namespace
 
 html_markup symbol_of(style how) {
     const tone &one = tone_of(how);
     return html_of("<span class=\"sym ", one.name, "\">", one.symbol, "</span>");
 }
 
-html_markup badge(style how, const std::string &words) {
+html_markup make_badge(style how, const std::string &words) {
     const tone &one = tone_of(how);
     return html_of("<span class=\"badge ", one.name, "\"><span>", one.symbol, "</span> ", words, "</span>");
 }
 
-html_markup unknown() {
+html_markup unknown_badge() {
     return {"<span class=\"badge unknown\"><span>?</span> unknown</span>"};
 }
 
 html_markup known_or_unknown(const std::string &text) {
-    return text.empty() ? unknown() : html_of(text);
+    return text.empty() ? unknown_badge() : html_of(text);
 }
 
-std::string dotted(std::string words) {
+std::string separate_by_dots(std::string words) {
     for (size_t at = 0; (at = words.find("  ", at)) != std::string::npos;)
         words.replace(at, 2, " \u00b7 ");
     return words;
@@ -68,13 +70,13 @@ std::string dotted(std::string words) {
 // --- Tables
 
 namespace {
+
 struct table_kind {
     const char *name;
     std::vector<const char *> heads;
 };
-} // namespace
 
-static std::vector<table_kind> make_table_kinds() {
+std::vector<table_kind> make_table_kinds() {
     std::vector<table_kind> kinds = {
         {"alarms", {"alarm", "group", "since", "what", "reporter"}},
         {"routers", {"router", "connection", "for", "forward", "assign", "return", "share here", "table"}},
@@ -91,10 +93,12 @@ static std::vector<table_kind> make_table_kinds() {
     return kinds;
 }
 
-static const std::vector<table_kind> &table_kinds() {
+const std::vector<table_kind> &table_kinds() {
     static const std::vector<table_kind> kinds = make_table_kinds();
     return kinds;
 }
+
+} // namespace
 
 void open_table(std::string *out, const char *name) {
     add_html(out, "<table class=\"", name, "\"><thead><tr>");
@@ -125,13 +129,15 @@ void add_reason(std::string *out, const reason &one, bool name_group) {
 
 // --- Style
 
+namespace {
+
 // Colours of appliances that remain apart for colour-blind readers, each with that of its letter.
-static const char *const PALETTE[][2] = {{"#0072b2", "#fff"}, {"#e69f00", "#000"}, {"#009e73", "#000"},
-                                         {"#cc79a7", "#000"}, {"#56b4e9", "#000"}, {"#d55e00", "#000"},
-                                         {"#f0e442", "#000"}, {"#999999", "#000"}};
+const char *const PALETTE[][2] = {{"#0072b2", "#fff"}, {"#e69f00", "#000"}, {"#009e73", "#000"},
+                                  {"#cc79a7", "#000"}, {"#56b4e9", "#000"}, {"#d55e00", "#000"},
+                                  {"#f0e442", "#000"}, {"#999999", "#000"}};
 static_assert(std::size(PALETTE) == PAGE_COLOURS);
 
-static const char STYLE[] = R"(
+const char STYLE[] = R"(
 :root{color-scheme:light dark;--page:#f4f6f8;--card:#fff;--line:#d5dbe3;--text:#1b2129;--dim:#586474;
 --good:#0b6e55;--good-bg:#e3f4ee;--warn:#855300;--warn-bg:#fff2d1;--bad:#a9241b;--bad-bg:#fdeae7;--note-bg:#eef1f5}
 @media screen and (prefers-color-scheme:dark){:root{--page:#12161b;--card:#1b2129;--line:#343d49;--text:#e6eaef;--dim:#9eabba;
@@ -235,6 +241,8 @@ td.zero{display:none}
 .head,.reason,.tiles div{break-inside:avoid}summary{break-after:avoid}h2,h3{break-after:avoid}tr{break-inside:avoid}
 .strips{grid-template-columns:1fr 1fr}}
 )";
+
+} // namespace
 
 std::string html_style() {
     std::string out = STYLE;

@@ -1,7 +1,7 @@
 // The parts of the page that "mgmtctl show --html" makes (show_draw.h has the whole).
 //
-// The page is one file without scripts, which loads nothing. A state has a symbol and a word beside its
-// colour, and what is unknown is shown as unknown.
+// The page is one file without scripts that loads nothing. Each state has a symbol and a word as well as a
+// colour; unknown values are shown as unknown.
 #pragma once
 
 #include <string>
@@ -22,27 +22,27 @@ struct html_view {
 // --- Pieces (html_parts.cpp)
 
 std::string html_style(); // the content of the style element
-html_markup badge(style how, const std::string &words);
+html_markup make_badge(style how, const std::string &words);
 html_markup symbol_of(style how);
-html_markup unknown();
+html_markup unknown_badge();
 html_markup known_or_unknown(const std::string &text);
-std::string dotted(std::string words); // dots where the screen has two blanks
+std::string separate_by_dots(std::string words); // separates by dots what the screen separates by two blanks
 
 // Begins a table with its column heads. On a narrow screen a row is a block, in which each cell after the
 // first is preceded by its head.
 void open_table(std::string *out, const char *name);
 void close_table(std::string *out);
 
-// A cause with its values, its times and the next step.
+// Adds a cause with its values and times, and the next step.
 void add_reason(std::string *out, const reason &one, bool name_group);
 
 // --- Groups (html_group.cpp)
 
 bool needs_attention(const html_view &view, const snapshot_group &group);
-// Folded up unless it needs attention, or is one of a few.
+// Folded unless it needs attention or there are few groups.
 void add_group(std::string *out, const html_view &view, const snapshot_group &group);
 
-// How many buckets or values of a table have another owner than is wanted.
+// How many buckets or values of a table have another owner than the wanted one.
 size_t differing_buckets(const snapshot_table &wanted, const snapshot_table &found);
 void add_strip(std::string *out, const html_view &view, const snapshot_group &group,
                const snapshot_table &table);

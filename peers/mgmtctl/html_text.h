@@ -1,11 +1,11 @@
-// Building HTML: what is written in the sources is markup, everything else is escaped.
+// Builds HTML: string literals are markup, everything else is escaped.
 #pragma once
 
 #include <string>
 #include <string_view>
 #include <type_traits>
 
-// Finished markup, which is not escaped again.
+// Markup that is not escaped again.
 struct html_markup {
     std::string text;
 };

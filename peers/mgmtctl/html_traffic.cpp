@@ -2,21 +2,23 @@
 // refused, and flows that other appliances have.
 #include "peers/mgmtctl/html_parts.h"
 
-static html_markup count_cell(uint64_t count) {
+namespace {
+
+html_markup count_cell(uint64_t count) {
     return html_of("<td class=\"num", count == 0 ? " zero" : "", "\">", count_text(count), "</td>");
 }
 
-static html_markup count_cell(const traffic_count &count) {
+html_markup count_cell(const traffic_count &count) {
     if (count.packets == 0)
         return count_cell(0);
     return html_of("<td class=\"num\" title=\"", count.packets, " packets, ", count.bytes, " bytes\">",
                    count_text(count.packets), "</td>");
 }
 
-static void add_intercept(std::string *out, const traffic_intercept &one) {
+void add_intercept(std::string *out, const traffic_intercept &one) {
     const style how = one.proxy == "up" ? style::good : one.proxy == "down" ? style::bad : style::warn;
     add_html(out, "<tr><td><a href=\"#group-", one.group, "\">Group ", one.group, "</a></td><td>",
-             badge(how, one.proxy.empty() ? "unknown" : one.proxy));
+             make_badge(how, one.proxy.empty() ? "unknown" : one.proxy));
     if (one.proxy_ms > 0)
         add_html(out, " <span class=\"dim\">for ", duration_text(one.proxy_ms), "</span>");
     if (one.proxy == "down" && !one.proxy_reason.empty())
@@ -25,10 +27,10 @@ static void add_intercept(std::string *out, const traffic_intercept &one) {
          {std::pair(!one.active, "standing by"), std::pair(one.left, "left its routers"),
           std::pair(one.overloaded, "overloaded")})
         if (holds)
-            add_html(out, " ", badge(style::warn, words));
+            add_html(out, " ", make_badge(style::warn, words));
     if (one.weight_percent < 100)
-        add_html(out, " ", badge(style::plain, std::to_string(one.weight_percent) + "% of its weight"));
-    add_html(out, "</td><td class=\"num\">", one.flows < 0 ? unknown() : html_of(one.flows), "</td>");
+        add_html(out, " ", make_badge(style::plain, std::to_string(one.weight_percent) + "% of its weight"));
+    add_html(out, "</td><td class=\"num\">", one.flows < 0 ? unknown_badge() : html_of(one.flows), "</td>");
     for (const sorted_way &way : sorted_ways()) {
         const auto found = one.sorted.find(way.word);
         add_html(out, count_cell(found == one.sorted.end() ? traffic_count{} : found->second));
@@ -36,7 +38,7 @@ static void add_intercept(std::string *out, const traffic_intercept &one) {
     add_html(out, "</tr>\n");
 }
 
-static std::string refused_text(const refused_counts &refused) {
+std::string refused_text(const refused_counts &refused) {
     std::string out;
     for (const auto &[why, packets] : refused)
         if (packets > 0)
@@ -44,12 +46,12 @@ static std::string refused_text(const refused_counts &refused) {
     return out;
 }
 
-static std::string bytes_text(uint64_t bytes) {
+std::string bytes_text(uint64_t bytes) {
     const std::string count = count_text(bytes);
     return count + (count.back() >= '0' && count.back() <= '9' ? " B" : "B");
 }
 
-static void add_tunnel(std::string *out, const traffic_tunnel &one) {
+void add_tunnel(std::string *out, const traffic_tunnel &one) {
     const std::string refused = refused_text(one.refused);
     const auto amount = [](const traffic_count &count) {
         return html_of("<td title=\"", count.packets, " packets, ", count.bytes, " bytes\">",
@@ -62,7 +64,7 @@ static void add_tunnel(std::string *out, const traffic_tunnel &one) {
              refused.empty() ? html_of(" class=\"zero\">0") : html_of(">", refused), "</td></tr>\n");
 }
 
-static void add_refused(std::string *out, const traffic_state &traffic) {
+void add_refused(std::string *out, const traffic_state &traffic) {
     const std::string refused = refused_text(traffic.refused);
     if (refused.empty() && traffic.refused_sources.empty() && traffic.accepted.empty())
         return;
@@ -74,31 +76,32 @@ static void add_refused(std::string *out, const traffic_state &traffic) {
         for (const auto &[address, packets] : traffic.refused_sources)
             add_html(out, "<tr><td>", address, "</td><td>", count_text(packets), "</td><td>",
                      traffic.accepted.contains(address)
-                         ? badge(style::good, "accepted since")
-                         : html_of(badge(style::warn, "refused"), " <code>mgmtctl tunnel accept ", address,
-                                   "</code>"),
+                         ? make_badge(style::good, "accepted since")
+                         : html_of(make_badge(style::warn, "refused"), " <code>mgmtctl tunnel accept ",
+                                   address, "</code>"),
                      "</td></tr>\n");
         for (const auto &[address, router] : traffic.accepted)
             if (!traffic.refused_sources.contains(address))
                 add_html(out, "<tr><td>", address, "</td><td class=\"zero\">0</td><td>",
-                         badge(style::good, "accepted"), router.empty() ? "" : " beside router ", router,
+                         make_badge(style::good, "accepted"), router.empty() ? "" : " beside router ", router,
                          "</td></tr>\n");
         close_table(out);
     }
     add_html(out, "</div>\n");
 }
 
-static void add_protection(std::string *out, const protection_state &state) {
+void add_protection(std::string *out, const protection_state &state) {
     add_html(out, "<div class=\"card\"><h3>Protection of flows</h3><p>");
     if (state.time == 0)
         add_html(out, "switched off");
     else
-        add_html(out, "for ", state.time, " s \u00b7 packets ", dotted(protection_text(state.sum)));
+        add_html(out, "for ", state.time, " s \u00b7 packets ", separate_by_dots(protection_text(state.sum)));
     add_html(out, "</p>\n");
     for (const protected_group &each : state.groups)
         if (!each.covered && state.time != 0)
-            add_html(out, "<p>", badge(style::plain, "group " + std::to_string(each.group) + " not covered"),
-                     " ", each.reason, "</p>\n");
+            add_html(out, "<p>",
+                     make_badge(style::plain, "group " + std::to_string(each.group) + " not covered"), " ",
+                     each.reason, "</p>\n");
     if (!state.members.empty()) {
         open_table(out, "members");
         for (const auto &[address, counts] : state.members)
@@ -110,14 +113,16 @@ static void add_protection(std::string *out, const protection_state &state) {
     add_html(out, "</div>\n");
 }
 
+} // namespace
+
 void add_traffic(std::string *out, const html_view &view) {
     const traffic_state &traffic = view.shown.traffic;
     add_html(out, "<h2>Traffic</h2>\n");
     for (const traffic_drain &each : traffic.drains)
-        add_html(out, "<p>", badge(style::warn, "group " + std::to_string(each.group)), " ",
+        add_html(out, "<p>", make_badge(style::warn, "group " + std::to_string(each.group)), " ",
                  drain_text(each, view.origin.now), "</p>\n");
     if (traffic.tunneld != tunneld_condition::running) {
-        add_html(out, "<div class=\"card\"><p>", unknown(), " tunneld ",
+        add_html(out, "<div class=\"card\"><p>", unknown_badge(), " tunneld ",
                  traffic.tunneld == tunneld_condition::absent ? "has no session" : "does not answer",
                  ": intercepts, proxies, flows and tunnels</p></div>\n");
         return;
@@ -133,7 +138,7 @@ void add_traffic(std::string *out, const html_view &view) {
     }
     add_html(out, "</div>\n<div class=\"card\"><h3>Tunnels</h3><p>Data plane <b>", traffic.plane, "</b>");
     if (!traffic.plane_reason.empty())
-        add_html(out, " <span class=\"dim\">", traffic.plane_reason, "</span>");
+        add_html(out, " <span class=\"dim\">(", traffic.plane_reason, ")</span>");
     if (traffic.clamped > 0)
         add_html(out, " \u00b7 MSS clamped in ", count_text(traffic.clamped), " SYN-ACKs");
     if (traffic.own > 0)
@@ -142,7 +147,7 @@ void add_traffic(std::string *out, const html_view &view) {
     add_html(out, "</p>\n");
     for (const std::string &wrong : {traffic.lack, traffic.failure})
         if (!wrong.empty())
-            add_html(out, "<p>", badge(style::bad, "kernel"), " ", wrong, "</p>\n");
+            add_html(out, "<p>", make_badge(style::bad, "kernel"), " ", wrong, "</p>\n");
     if (traffic.tunnels.empty())
         add_html(out, "<p class=\"dim\">none</p>");
     else {

@@ -1,8 +1,8 @@
-// Metrics are made of state nodes by tables: each row says which node, or which word of a text, becomes which
-// sample. What wccpd has of a group comes in one text for each group, since thousands of routers would be
-// tens of thousands of nodes, and many groups are asked for at once.
+// Tables turn state nodes into metrics: each row maps a node, or a word of a text, to a sample. wccpd reports
+// each group as one text, because thousands of routers would be tens of thousands of nodes, and many groups
+// are requested at once.
 //
-// A sample becomes a line of text as soon as it is known: a large appliance has 50,000 of them.
+// Samples are written as text immediately: a large appliance has 50,000 of them.
 #include "peers/mgmtctl/metrics.h"
 
 #include <algorithm>
@@ -20,7 +20,7 @@ constexpr size_t GROUPS_AT_ONCE = 32; // in one request: the answer is at most 4
 constexpr size_t WORDS_MAX = 8;       // of a line
 constexpr size_t SAMPLE_MAX = 1024;   // of a sample
 
-// The value of a sample by the text of its node; false: the node gives none.
+// Converts the text of a node to the value of a sample; false: the node has no sample.
 using metric_value = bool (*)(const std::string &text, std::string *out_value);
 
 struct metric_row {
@@ -51,7 +51,7 @@ bool take_flag(const std::string &text, std::string *out) {
 }
 bool take_up_or_down(const std::string &text, std::string *out) {
     *out = text == "up" ? "1" : "0";
-    return text == "up" || text == "down"; // unknown as yet: no sample
+    return text == "up" || text == "down"; // no sample while it is unknown
 }
 
 constexpr metric_row rows[] = {
@@ -97,7 +97,7 @@ struct gathering {
     void add(size_t family, std::string_view labels, std::string_view value) const {
         const metric_family &about = metric_families[family];
         std::string *lines = &(*out)[family];
-        // Megabytes are neither copied often nor touched before they are needed.
+        // Grows in large steps: megabytes are seldom copied, and memory is not touched before it is needed.
         if (lines->capacity() - lines->size() < SAMPLE_MAX)
             lines->reserve(std::max(lines->capacity() * 8, 2 * SAMPLE_MAX));
         lines->append(about.name);
@@ -107,7 +107,7 @@ struct gathering {
             lines->append("{").append(labels).append("}");
         lines->append(" ").append(value).append("\n");
     }
-    // False: no answer, neither from a daemon nor from mgmtd.
+    // False: neither a daemon nor mgmtd has answered.
     bool ask(ctl_walk walk, const std::vector<std::string> &names, ctl_reply *reply) const {
         *reply = {};
         return source(walk, names, reply);
@@ -124,13 +124,13 @@ void add_label(std::string *inout, std::string_view name, std::string_view value
     *inout += '"';
 }
 
-std::string label(std::string_view name, std::string_view value) {
+std::string make_label(std::string_view name, std::string_view value) {
     std::string out;
     add_label(&out, name, value);
     return out;
 }
 
-// The next word, which is taken off `inout`; empty at the end.
+// Removes the next word from `inout` and returns it; empty at the end.
 std::string_view take_word(std::string_view *inout) {
     inout->remove_prefix(std::min(inout->find_first_not_of(' '), inout->size()));
     const std::string_view word = inout->substr(0, inout->find(' '));
@@ -192,7 +192,7 @@ void add_tunnel_names(const gathering &work, const std::vector<ctl_binding> &bin
             parts.size() == 2)
             tunnels[parts[0]][parts[1]] = binding.value;
     for (auto &[id, nodes] : tunnels) {
-        std::string labels = label("tunnel", id);
+        std::string labels = make_label("tunnel", id);
         add_label(&labels, "router", nodes["remote"]);
         add_label(&labels, "interface", nodes["interface"]);
         work.add(metric_place("wccp_tunnel"), labels, "1");
@@ -206,9 +206,9 @@ bool gather_tunneld(const gathering &work) {
         return false;
     const auto plane = std::ranges::find(reply.bindings, NODE_PLANE_STATE "/name", &ctl_binding::name);
     const bool running = plane != reply.bindings.end();
-    work.add(metric_place("wccp_daemon_up"), label("daemon", "tunneld"), running ? "1" : "0");
+    work.add(metric_place("wccp_daemon_up"), make_label("daemon", "tunneld"), running ? "1" : "0");
     if (running)
-        work.add(metric_place("wccp_data_plane"), label("plane", plane->value), "1");
+        work.add(metric_place("wccp_data_plane"), make_label("plane", plane->value), "1");
     add_node_samples(work, reply.bindings);
     add_tunnel_names(work, reply.bindings);
     return true;
@@ -216,10 +216,10 @@ bool gather_tunneld(const gathering &work) {
 
 // --- wccpd
 
-// A line of a text: the word that it begins with, its labels, and the samples that the words after them are.
+// A line of a text: its first word, then its labels, then a value for each family.
 struct line_row {
     std::string_view word;
-    size_t labels; // as many words, named as the families' labels after "group"
+    size_t labels; // number of words, named like the families' labels after "group"
     std::vector<size_t> families;
 };
 const std::vector<line_row> &text_lines() {
@@ -303,7 +303,7 @@ bool gather_groups(const gathering &work) {
         for (const ctl_binding &binding : reply.bindings)
             if (const std::vector<std::string> parts = parts_below(NODE_GROUP_STATE, binding.name);
                 parts.size() == 3)
-                add_text(work, label("group", parts[0]), binding.value);
+                add_text(work, make_label("group", parts[0]), binding.value);
     }
     return true;
 }
@@ -313,10 +313,10 @@ bool gather_wccpd(const gathering &work) {
     if (!work.ask(ctl_walk::node, {NODE_WCCPD_VERSION, NODE_WCCPD_STATE "/metric/all"}, &reply))
         return false;
     const bool running = reply.code == 0 && !reply.bindings.empty();
-    work.add(metric_place("wccp_daemon_up"), label("daemon", "wccpd"), running ? "1" : "0");
+    work.add(metric_place("wccp_daemon_up"), make_label("daemon", "wccpd"), running ? "1" : "0");
     for (const ctl_binding &binding : reply.bindings)
         if (binding.name == NODE_WCCPD_VERSION)
-            work.add(metric_place("wccp_build"), label("version", binding.value), "1");
+            work.add(metric_place("wccp_build"), make_label("version", binding.value), "1");
         else
             add_text(work, "", binding.value);
     return !running || gather_groups(work);
@@ -328,7 +328,7 @@ bool gather_mgmtd(const gathering &work) {
     ctl_reply reply;
     if (!work.ask(ctl_walk::subtree, {NODE_ALARMS_RAISED, NODE_PROCESSES}, &reply))
         return false;
-    work.add(metric_place("wccp_daemon_up"), label("daemon", "mgmtd"), "1");
+    work.add(metric_place("wccp_daemon_up"), make_label("daemon", "mgmtd"), "1");
     add_node_samples(work, reply.bindings);
     std::erase_if(reply.bindings, [](const ctl_binding &binding) {
         return parts_below(NODE_ALARMS_RAISED, binding.name).empty();
@@ -336,7 +336,7 @@ bool gather_mgmtd(const gathering &work) {
     const std::vector<ctl_alarm> active = alarms_of(reply.bindings);
     work.add(metric_place("wccp_alarms"), "", std::to_string(active.size()));
     for (const ctl_alarm &alarm : active) {
-        std::string labels = label("alarm", alarm.name);
+        std::string labels = make_label("alarm", alarm.name);
         add_label(&labels, "source", alarm.source);
         work.add(metric_place("wccp_alarm_active"), labels, "1");
     }
@@ -350,7 +350,7 @@ bool gather_metrics(const metric_source &source, metric_lines *out) {
     if (gather_mgmtd(work) && gather_wccpd(work) && gather_tunneld(work))
         return true;
     *out = {};
-    work.add(metric_place("wccp_daemon_up"), label("daemon", "mgmtd"), "0");
+    work.add(metric_place("wccp_daemon_up"), make_label("daemon", "mgmtd"), "0");
     return false;
 }
 
@@ -361,7 +361,7 @@ std::vector<std::string> metrics_text(metric_lines samples, metric_format format
         if (samples[i].empty())
             continue;
         const metric_family &family = metric_families[i];
-        // Readers of the older format know a metric by its whole name, and refuse the type "info".
+        // In the older format a metric has its whole name, and there is no type "info".
         std::string name(family.name);
         if (!modern && family.kind == metric_kind::counter)
             name += "_total";

@@ -11,11 +11,13 @@
 #include "peers/mgmtctl/render.h"
 #include "runtime/ttime.h"
 
-static constexpr size_t REQUEST_MAX = 8192;
-static constexpr int64_t REQUEST_MS = 5000;
+namespace {
 
-// The request with its headers, or what has come of it when the time or the room is over.
-static std::string read_request() {
+constexpr size_t REQUEST_MAX = 8192;
+constexpr int64_t REQUEST_MS = 5000;
+
+// The request with its headers, or the part of it that arrived within the limits of time and size.
+std::string read_request() {
     std::string request;
     const int64_t until = lt_monotonic_ms() + REQUEST_MS;
     while (request.size() < REQUEST_MAX && request.find("\r\n\r\n") == std::string::npos) {
@@ -32,8 +34,8 @@ static std::string read_request() {
     return request;
 }
 
-static int answer_request(const char *status, const char *type, const std::vector<std::string> &body,
-                          bool with_body, int code) {
+int answer_request(const char *status, const char *type, const std::vector<std::string> &body, bool with_body,
+                   int code) {
     size_t length = 0;
     for (const std::string &piece : body)
         length += piece.size();
@@ -45,12 +47,14 @@ static int answer_request(const char *status, const char *type, const std::vecto
     return code;
 }
 
-static metric_source asking(const ctl_link &link) {
+metric_source make_metric_source(const ctl_link &link) {
     return [link](ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out) {
         std::string reason;
         return link.query_all(walk, names, out, &reason);
     };
 }
+
+} // namespace
 
 int serve_metrics_request(const ctl_link &link) {
     static constexpr char PLAIN[] = "text/plain; charset=utf-8";
@@ -70,7 +74,7 @@ int serve_metrics_request(const ctl_link &link) {
                                      : metric_format::text;
     // A mgmtd that does not answer is what the samples say then.
     metric_lines samples;
-    (void)gather_metrics(asking(link), &samples);
+    (void)gather_metrics(make_metric_source(link), &samples);
     return answer_request("200 OK", metrics_content_type(format), metrics_text(std::move(samples), format),
                           !head, CTL_OK);
 }
@@ -80,7 +84,7 @@ int ctl_metrics(const ctl_options &options, bool text, bool http) {
     if (http)
         return serve_metrics_request(link);
     metric_lines samples;
-    const bool answered = gather_metrics(asking(link), &samples);
+    const bool answered = gather_metrics(make_metric_source(link), &samples);
     for (const std::string &piece :
          metrics_text(std::move(samples), text ? metric_format::text : metric_format::openmetrics))
         put(piece);

@@ -1,5 +1,5 @@
-// Every metric there can be, in the order of the output. A sample names its family here, and a name that is
-// missing does not compile; docs/metrics.md lists the same names.
+// All metrics, in the order of the output. metric_place() finds a family by name, at compile time;
+// docs/metrics.md lists the same names.
 #pragma once
 
 #include <cstddef>

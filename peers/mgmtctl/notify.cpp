@@ -1,14 +1,14 @@
-// "mgmtctl notify run" is a service of its own, which needs no privilege: it follows mgmtd like any viewer.
-// It may hang or be killed without harm to the appliance.
+// "mgmtctl notify run" is a separate service without privileges, which follows mgmtd like any viewer. It can
+// hang or be killed without harm to the appliance.
 //
-// Events tell of changes at once. Every COMPARE_MS, in each new session and after the end of a daemon, all
-// states are asked for and compared with those that commands have been run for. These are kept in a file,
-// which is written after the commands of a change have ended: a change that comes while nobody looks is late,
-// and one whose commands were interrupted is reported again. An answer is applied before the events that came
-// during the request. Each of these is followed by an event or contained in the answer, so the last state is
-// the right one.
+// Events report changes immediately. Every COMPARE_MS, in each new session and when a daemon has ended, all
+// states are queried and compared with those for which commands have been run. These are kept in a file,
+// which is written after the commands of a change have finished. A change that happens while the service is
+// down is therefore reported late, and one whose commands were interrupted is reported again. Events that
+// arrive during a query are applied after its answer. They may be older than the answer, but the event
+// of the latest change is always applied last.
 //
-// One change is reported at a time. Its reason is asked for just before, when no command runs.
+// Changes are reported one at a time. The reason is queried just before, while no command is running.
 #include <algorithm>
 #include <cerrno>
 #include <csignal>
@@ -39,17 +39,17 @@
 
 namespace {
 
-constexpr int64_t COMPARE_MS = 60000;      // between two comparisons with the states that mgmtd has
+constexpr int64_t COMPARE_MS = 60000;      // between two comparisons with the states of mgmtd
 constexpr int64_t CONNECT_MS = 1000;       // between two attempts to reach mgmtd
-constexpr int64_t GIVE_UP_MS = 30000;      // without mgmtd, until the roles count as unknown
-constexpr int64_t LOOK_MS = 1000;          // a wait at most: for the watchdog, and for signals just missed
+constexpr int64_t GIVE_UP_MS = 30000;      // without mgmtd, before roles become UNKNOWN
+constexpr int64_t LOOK_MS = 1000;          // longest wait, for the watchdog and signals that arrive before it
 constexpr size_t BOOK_BYTES_MAX = 1 << 20; // of the file
 
 const char *const FOLLOWED_EVENTS[] = {EVENT_ROLE_CHANGE,      EVENT_RAISE_ALARM,   EVENT_CLEAR_ALARM,
                                        EVENT_PROXY_CHANGE,     EVENT_PROCESS_CRASH, EVENT_PROCESS_EXIT,
                                        EVENT_PROCESS_TERMINATE};
 
-void say(const std::string &line) {
+void log_line(const std::string &line) {
     fprintf(stderr, "notify: %s\n", clean_text(line, 512).c_str());
 }
 
@@ -65,25 +65,25 @@ struct notifier {
     notify_book book;
     ctl_held_session session;
     int64_t connect_at_ms = 0, compare_at_ms = 0;
-    int64_t lost_at_ms = 0; // since when mgmtd is not there; -1: it is, or the roles are unknown already
-    std::string complaint;  // why, as it was logged last
-    std::vector<std::string> refused; // commands, as they were logged last
-    std::string saved;                // what the file has
-    pid_t runner = 0;                 // that runs the commands of a change; 0: none
+    int64_t lost_at_ms = 0;           // when mgmtd was lost; -1: it was not, or roles are already UNKNOWN
+    std::string complaint;            // why mgmtd cannot be reached, as last logged
+    std::vector<std::string> refused; // commands, as last logged
+    std::string saved;                // content of the file
+    pid_t runner = 0;                 // process that runs the commands of a change; 0: none
     int runner_fd = -1;
     uint64_t reported = 0, failed = 0, timed_out = 0;
 
     notifier(const ctl_options &given, const ctl_notify_options &wanted) : options(given), how(wanted) {
-        book.say = say;
+        book.say = log_line;
         book.clock_s = clock_s;
         lost_at_ms = lt_monotonic_ms();
     }
 };
 
-// Logged once until it changes or ends.
-void complain(notifier *self, const std::string &complaint) {
+// Logs a complaint once, until it changes or ends.
+void log_complaint(notifier *self, const std::string &complaint) {
     if (complaint != self->complaint && !complaint.empty())
-        say(complaint);
+        log_line(complaint);
     self->complaint = complaint;
 }
 
@@ -97,8 +97,7 @@ bool load_book(notifier *self) {
     in.read(text.data(), static_cast<std::streamsize>(text.size()));
     text.resize(static_cast<size_t>(in.gcount()));
     if (const size_t unreadable = notify_read_book(&self->book, text))
-        say(self->how.state_file + ": " + std::to_string(unreadable) +
-            " lines cannot be read, and are left out");
+        log_line(self->how.state_file + ": " + std::to_string(unreadable) + " invalid lines are ignored");
     self->saved = text;
     return true;
 }
@@ -111,8 +110,8 @@ void save_book(notifier *self) {
     out << text;
     out.close();
     if (!out || rename(fresh.c_str(), self->how.state_file.c_str()) != 0)
-        say(self->how.state_file + ": " + strerror(errno) +
-            "; after a restart changes will be reported again");
+        log_line(self->how.state_file + ": " + strerror(errno) +
+                 "; after a restart, changes will be reported again");
     else
         self->saved = text;
 }
@@ -123,7 +122,7 @@ void lose_session(notifier *self, const std::string &reason) {
     self->session.reset();
     self->lost_at_ms = lt_monotonic_ms();
     self->connect_at_ms = self->lost_at_ms + CONNECT_MS;
-    complain(self, reason + "; changes are reported once it is back");
+    log_complaint(self, reason + "; changes are reported once it is back");
 }
 
 bool follow_mgmtd(notifier *self, std::string *out_reason) {
@@ -142,7 +141,7 @@ void try_to_connect(notifier *self) {
     if (self->session || now < self->connect_at_ms)
         return;
     if (follow_mgmtd(self, &reason)) {
-        say("follows mgmtd");
+        log_line("follows mgmtd");
         self->complaint.clear();
         self->lost_at_ms = -1;
         self->compare_at_ms = now;
@@ -150,7 +149,7 @@ void try_to_connect(notifier *self) {
     }
     self->session.reset();
     self->connect_at_ms = lt_monotonic_ms() + CONNECT_MS;
-    complain(self, reason);
+    log_complaint(self, reason);
     if (self->lost_at_ms >= 0 && now - self->lost_at_ms >= GIVE_UP_MS) {
         self->lost_at_ms = -1;
         notify_compare(&self->book, notify_kind::role, {}); // wccpd doesn't run without mgmtd
@@ -167,7 +166,7 @@ void compare_states(notifier *self) {
                 lose_session(self, reason);
             return;
         }
-        if (reply.code == LC_OK) // otherwise tunneld is not there, and nothing is known of the proxies
+        if (reply.code == LC_OK) // otherwise tunneld is gone, and the proxies are unknown
             notify_compare(&self->book, kind, read_notify_states(kind, reply));
     }
 }
@@ -177,7 +176,7 @@ void take_event(notifier *self, const ctl_event &event) {
     notify_state state;
     if (read_notify_event(event, &subject, &state))
         notify_note(&self->book, subject, state.state, state.detail);
-    else // of a process: what it reported is gone as well
+    else // a process has ended, and with it the states that it reported
         self->compare_at_ms = std::min(self->compare_at_ms, lt_monotonic_ms() + CONNECT_MS);
 }
 
@@ -187,7 +186,7 @@ std::vector<reason> find_reasons(notifier *self, const notify_change &change) {
     snapshot_limits limits;
     limits.only = notify_group(change.subject);
     if (limits.only < 0)
-        limits.queries = 0; // of groups
+        limits.queries = 0; // no queries about groups
     std::string lost;
     const snapshot shown = gather_snapshot(
         [&](ctl_walk walk, const std::string &node, ctl_reply *out, std::string *out_reason) {
@@ -206,12 +205,12 @@ std::vector<reason> find_reasons(notifier *self, const notify_change &change) {
     return reasons_of(shown);
 }
 
-// The commands as they are now: a new one is run without a restart of this service.
+// Reads the directory at each change: a new command needs no restart of the service.
 std::vector<std::string> find_commands(notifier *self) {
     notify_commands found = find_notify_commands(self->how.directory);
     if (found.refused != self->refused)
         for (const std::string &line : found.refused)
-            say("refused: " + line);
+            log_line("refused: " + line);
     self->refused = found.refused;
     return found.paths;
 }
@@ -227,17 +226,18 @@ void start_next_change(notifier *self) {
     run.paths = find_commands(self);
     run.environment = notify_environment(change, reasons);
     run.limit_ms = int64_t{self->how.limit_s} * 1000;
-    run.say = say;
-    say(std::string(notify_kind_word(change.subject.kind)) + " " + change.subject.name + ": " + change.state +
-        " (was " + change.previous + "), " + std::to_string(run.paths.size()) + " commands");
+    run.say = log_line;
+    log_line(std::string(notify_kind_word(change.subject.kind)) + " " + change.subject.name + ": " +
+             change.state + " (was " + change.previous + "), " + std::to_string(run.paths.size()) +
+             " commands");
     if (!start_notify_commands(run, &self->runner, &self->runner_fd)) {
-        say(std::string("fork: ") + strerror(errno));
+        log_line(std::string("fork: ") + strerror(errno));
         self->runner = 0;
         self->failed++;
     }
 }
 
-// Takes in the end of the commands of a change, if they have ended; `wait`: until then.
+// Finishes a change whose commands have finished; with `wait`, waits for them.
 void finish_change(notifier *self, bool wait) {
     int status = 0;
     if (self->runner == 0 || waitpid(self->runner, &status, wait ? 0 : WNOHANG) == 0)
@@ -249,7 +249,7 @@ void finish_change(notifier *self, bool wait) {
     self->reported++;
     self->failed += outcome == NOTIFY_FAILED;
     self->timed_out += outcome == NOTIFY_TIMED_OUT;
-    // Of a change whose commands were interrupted the next start has to find that it is not reported.
+    // If the commands were interrupted, the change must be reported again after the next start.
     if (!wait || outcome == NOTIFY_DONE)
         save_book(self);
 }
@@ -276,7 +276,7 @@ void wait_for_news(notifier *self) {
     poll(&ended, 1, static_cast<int>(LOOK_MS));
 }
 
-void serve(notifier *self) {
+void serve_changes(notifier *self) {
     std::string counts;
     while (!ctl_stop_signal) {
         try_to_connect(self);
@@ -294,12 +294,12 @@ void serve(notifier *self) {
     if (self->runner != 0)
         kill(self->runner, SIGTERM);
     finish_change(self, true);
-    say("ends: " + describe_counts(*self));
+    log_line("ends: " + describe_counts(*self));
 }
 
 // --- The user
 
-// Makes the directory of the file, for this user, when it is missing.
+// Creates the directory of the file for this user if it is missing.
 bool make_state_directory(const std::string &file, uid_t user, gid_t group) {
     const std::string directory = std::filesystem::path(file).parent_path();
     if (directory.empty() || access(directory.c_str(), F_OK) == 0)
@@ -307,7 +307,7 @@ bool make_state_directory(const std::string &file, uid_t user, gid_t group) {
     return mkdir(directory.c_str(), 0700) == 0 && chown(directory.c_str(), user, group) == 0;
 }
 
-// Gives up root for ever. False with the reason.
+// Gives up root permanently. False with the reason.
 bool become_user(const ctl_notify_options &how, std::string *out_reason) {
     const passwd *user = getpwnam(how.user.c_str());
     if (!user || user->pw_uid == 0) {
@@ -339,10 +339,10 @@ int run_notifier(const ctl_options &options, const ctl_notify_options &how) {
     notifier self(options, how);
     if (!load_book(&self))
         return tell_failure(options, {CTL_USAGE, "", how.state_file + ": " + strerror(errno), "", 0});
-    say("runs the commands of " + how.directory + ", " + std::to_string(find_commands(&self).size()) +
-        " at present");
+    log_line("runs the commands of " + how.directory + ", " + std::to_string(find_commands(&self).size()) +
+             " at present");
     service_report("READY=1");
-    serve(&self);
+    serve_changes(&self);
     return CTL_OK;
 }
 

@@ -13,7 +13,7 @@ constexpr size_t STATE_MAX = 15, NAME_MAX_BYTES = 160, SUBJECTS_MAX = 8192;
 constexpr struct kind_row {
     notify_kind kind;
     const char *word, *first;
-    const char *states; // all that there are, with a blank after each
+    const char *states; // all possible states, each followed by a blank
 } KINDS[] = {
     {notify_kind::role, "role", "UNKNOWN", "UNKNOWN ACTIVE BACKUP "},
     {notify_kind::alarm, "alarm", "cleared", "cleared raised "},
@@ -52,7 +52,7 @@ const char *notify_first_state(notify_kind kind) {
 void notify_note(notify_book *book, const notify_subject &subject, const std::string &state,
                  const std::string &detail) {
     if (subject.kind == notify_kind::health && state == notify_first_state(subject.kind))
-        return; // tunneld is starting, or gone: the health is that of before until it is known again
+        return; // tunneld is starting or gone: the previous health remains until it is known again
     if (const auto older = find_waiting(book, subject); older != book->waiting.end()) {
         if (older->state == state)
             return;

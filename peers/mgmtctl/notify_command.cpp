@@ -1,9 +1,8 @@
-// A process between mgmtctl and the commands waits for them: their time is kept while mgmtctl waits for
-// mgmtd.
+// A process between mgmtctl and the commands waits for them, so that their time limit is kept while mgmtctl
+// waits for mgmtd.
 //
-// It is the "subreaper" of what commands start. When a command ends before its own children, these become its
-// children, and a command is over only when no process of its group is left. The group's number cannot become
-// another group's before that.
+// It is the "subreaper" of the commands' children: it inherits those that outlive their command. A command
+// has finished when no process of its group is left; until then the number of the group cannot be reused.
 #include "peers/mgmtctl/notify_command.h"
 
 #include <algorithm>
@@ -19,7 +18,7 @@
 #include <unistd.h>
 
 extern "C" {
-#include <sys/pidfd.h> // glibc 2.36 doesn't say so itself
+#include <sys/pidfd.h> // glibc 2.36 lacks this in the header
 }
 
 #include "peers/mgmtctl/show_model.h"
@@ -37,7 +36,7 @@ bool is_command_name(const std::string &name) {
     });
 }
 
-// "" when nobody but root can have written it.
+// "" if only root can have written it.
 std::string why_not_trusted(const struct stat &about) {
     if (about.st_uid != 0)
         return "does not belong to root";
@@ -73,7 +72,7 @@ sigset_t awaited_signals() {
     setpgid(0, 0);
     sigset_t none;
     sigemptyset(&none);
-    for (int number = 1; number < NSIG; number++) // what was ignored would stay so
+    for (int number = 1; number < NSIG; number++) // ignored signals would remain ignored
         signal(number, SIG_DFL);
     sigprocmask(SIG_SETMASK, &none, nullptr);
     const int nothing = open("/dev/null", O_RDWR);
@@ -100,7 +99,7 @@ std::string describe_end(int status) {
                                : "exited with " + std::to_string(WEXITSTATUS(status));
 }
 
-// Whether the group has no process any more. The status of its leader goes to `out_status`.
+// Whether the group has no process left. `out_status` gets the status of its leader.
 bool reap_group(pid_t group, int *out_status) {
     for (;;) {
         int status = 0;
@@ -114,7 +113,7 @@ bool reap_group(pid_t group, int *out_status) {
     }
 }
 
-// The next signal of those that are awaited, or 0 at `due_ms`.
+// Waits for one of the awaited signals; 0 at `due_ms`.
 int wait_for_signal(int64_t due_ms) {
     const sigset_t set = awaited_signals();
     const int64_t left = std::max<int64_t>(due_ms - lt_monotonic_ms(), 0);
@@ -133,7 +132,7 @@ notify_outcome wait_for_group(pid_t group, const notify_run &run, const std::str
         }
         if (lt_monotonic_ms() < due_ms)
             continue;
-        if (sent == SIGKILL) { // it cannot be ended, as in a file system that hangs
+        if (sent == SIGKILL) { // it cannot be killed, for example in a file system that hangs
             run.say(path + ": does not end");
             return NOTIFY_TIMED_OUT;
         }
@@ -199,7 +198,7 @@ notify_outcome run_notify_commands(const notify_run &run) {
             worst = std::max(worst, NOTIFY_FAILED);
             continue;
         }
-        setpgid(pid, pid); // whoever of the two is first
+        setpgid(pid, pid); // both processes do this, because either may be first
         worst = std::max(worst, wait_for_group(pid, run, path, &stop));
     }
     return worst;
@@ -208,14 +207,14 @@ notify_outcome run_notify_commands(const notify_run &run) {
 bool start_notify_commands(const notify_run &run, pid_t *out_pid, int *out_pidfd) {
     const sigset_t set = awaited_signals();
     sigset_t before;
-    sigprocmask(SIG_BLOCK, &set, &before); // a signal that comes now is not for the handlers of this program
+    sigprocmask(SIG_BLOCK, &set, &before); // signals must not reach this program's handlers in the child
     const pid_t parent = getpid(), pid = fork();
     if (pid != 0)
         sigprocmask(SIG_SETMASK, &before, nullptr);
     if (pid < 0)
         return false;
     if (pid == 0) {
-        signal(SIGCHLD, SIG_DFL); // an ignored one would take the ends of commands away
+        signal(SIGCHLD, SIG_DFL); // if it were ignored, waitpid would not report the commands
         prctl(PR_SET_PDEATHSIG, SIGTERM);
         _exit(getppid() == parent ? run_notify_commands(run) : NOTIFY_FAILED);
     }

@@ -71,7 +71,7 @@ struct change_words {
     std::string code, cause, next;
 };
 
-// The reason to begin with; one that is no fault where there is nothing else. Null: nothing is known.
+// The group's main reason, or else any reason, even one that is not a fault. Null: none is known.
 const reason *first_reason(const std::vector<reason> &reasons, int group) {
     if (const reason *main = main_reason(reasons, group))
         return main;
@@ -80,7 +80,7 @@ const reason *first_reason(const std::vector<reason> &reasons, int group) {
     return found == reasons.end() ? nullptr : &*found;
 }
 
-// Why nobody reports roles and alarms of groups; null: wccpd is there.
+// Why roles and alarms of groups are not reported; null: they are.
 const reason *find_absence(const std::vector<reason> &reasons) {
     const auto found = std::find_if(reasons.begin(), reasons.end(), [](const reason &each) {
         return each.code == "mgmtd-unreachable" || each.code == "wccpd-absent";

@@ -1,5 +1,5 @@
-// The words of "mgmtctl notify": what mgmtd reports, as states of subjects, and what the commands get to know
-// of a change.
+// Translates for "mgmtctl notify": reports of mgmtd into states of subjects, and a change into the
+// environment of the commands.
 #pragma once
 
 #include <map>
@@ -10,13 +10,13 @@
 #include "peers/mgmtctl/reasons.h"
 #include "peers/mgmtctl/session.h"
 
-// The event as the state of a subject; false: it is about something else, or cannot be read.
+// Translates an event into the state of a subject; false: it is about something else, or invalid.
 bool read_notify_event(const ctl_event &event, notify_subject *out_subject, notify_state *out_state);
-// All subjects of the kind, from a walk of the node that has them.
+// The node to walk for all subjects of a kind, and the states found by that walk.
 const char *notify_node(notify_kind kind);
 std::map<std::string, notify_state> read_notify_states(notify_kind kind, const ctl_reply &reply);
 
 // The group that a subject belongs to; -1: none.
 int notify_group(const notify_subject &subject);
-// What the commands get to know, as "NAME=VALUE". Values are printable ASCII of at most 255 characters.
+// The variables of the commands, as "NAME=VALUE". Values are printable ASCII of at most 255 characters.
 std::vector<std::string> notify_environment(const notify_change &change, const std::vector<reason> &reasons);

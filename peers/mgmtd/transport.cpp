@@ -324,7 +324,7 @@ std::string name_of_user(uid_t uid) {
 }
 
 // Fills in the user of a connection. Gives why it is refused, or "".
-std::string identify(const transport *self, int fd, session *out) {
+std::string identify_client(const transport *self, int fd, session *out) {
     ucred who{};
     socklen_t length = sizeof who;
     if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &who, &length) != 0)
@@ -350,7 +350,7 @@ void accept_session(transport *self) {
     }
     listener_tidy(&self->place);
     session client{};
-    std::string refusal = identify(self, fd, &client);
+    std::string refusal = identify_client(self, fd, &client);
     if (refusal.empty() && !make_room(self))
         refusal = "too many";
     if (!refusal.empty()) {
