@@ -1,5 +1,5 @@
-// Metrics: what samples states become, in both formats, and the names that documents, alert rules, the
-// dashboard and the engine share with the table of metrics.
+// Metrics: the samples of states, in both formats, and the names that documents, alert rules, the dashboard
+// and the engine share with the table of metrics.
 #include <algorithm>
 #include <fstream>
 #include <iterator>
@@ -32,7 +32,7 @@ static std::string text_of(const metric_lines &samples, metric_format format) {
     return out;
 }
 
-// Numbers from outside stay numbers, texts stay within their labels, and a daemon that is gone is said to be.
+// Only numbers become values, texts cannot leave their labels, and a daemon that is gone is reported as down.
 TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
     const std::vector<ctl_binding> known = {
         {NODE_WCCPD_VERSION, "string", "1.0.0"},
@@ -138,7 +138,7 @@ TEST(Metrics, AreTheOnesThatOthersName) {
 
 // --- Nodes
 
-// Every node that there can be is in the documents, and no other state node is.
+// The documents list exactly the nodes that exist.
 TEST(Nodes, AreInTheDocuments) {
     static const std::set<std::string> ways = {"in",  "to_proxy",  "bypassed", "returned", "down",
                                                "own", "forwarded", "dropped",  "passed",   "overload"};
@@ -155,7 +155,7 @@ TEST(Nodes, AreInTheDocuments) {
                 last.resize(last.size() - 6);
             const bool sorted =
                 above.ends_with("/*") && ways.contains(last) && above.find("/member/") == std::string::npos;
-            // A node that only names what is below it needs no row.
+            // A node that only has others below it needs no row.
             if (sorted || last != "*" || documented.contains(node))
                 wanted.insert(sorted ? above + "/WAY" : node);
             else

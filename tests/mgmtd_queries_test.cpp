@@ -1,4 +1,4 @@
-// Queries: what mgmtd answers itself, and what it asks a daemon for.
+// Queries that mgmtd answers itself, and those that it forwards to a daemon.
 #include <gtest/gtest.h>
 #include <malloc.h>
 
@@ -11,7 +11,7 @@ const std::string WALK =
     " " + std::to_string(bn_qf_subtree | bn_qf_include_self); // flags of a walk of a group
 
 struct Queries : Mgmtd {
-    // What the daemon was asked for last, with the flags; and its answer.
+    // Answers the last query to the daemon; returns its name and flags.
     std::string answer_last(uint32_t peer_id, const std::vector<event_field> &fields,
                             uint32_t with_code = 0) {
         EXPECT_EQ(sent.back().peer, peer_id);
@@ -54,7 +54,7 @@ TEST_F(Queries, OfTheConfiguration) {
     EXPECT_EQ(last_response()->response_to, 77u);
 }
 
-TEST_F(Queries, OfAStateAreAskedOfTheDaemonAndTheAnswerPassedOn) {
+TEST_F(Queries, OfStatesAreForwardedToTheDaemonAndTheAnswerBack) {
     query(3, STATE + "/51/oper", bn_query_get);
     ASSERT_EQ(sent.size(), 1u);
     EXPECT_EQ(sent[0].peer, 1u) << "the working session, not that of the alarms";
@@ -63,7 +63,7 @@ TEST_F(Queries, OfAStateAreAskedOfTheDaemonAndTheAnswerPassedOn) {
     const uint32_t asked = sent[0].request->msg_id, node_id = last->node_id;
     clear();
     answer(2, asked, node_id, 0);
-    EXPECT_TRUE(sent.empty()) << "only who was asked may answer";
+    EXPECT_TRUE(sent.empty()) << "only the queried daemon may answer";
     answer(1, asked, node_id, 0);
     ASSERT_EQ(sent.size(), 1u);
     EXPECT_EQ(sent[0].peer, 3u);
@@ -94,8 +94,8 @@ TEST_F(Queries, ThatWaitAreBoundedAndKeepNoAnswers) {
     EXPECT_TRUE(daemon.pending.empty() && daemon.pending_bytes == 0);
 }
 
-// The groups are asked for one after the other, and no longer than the answer fits a message.
-TEST_F(Queries, OfAllGroupsGoGroupByGroup) {
+// Groups are queried one after the other, as long as the answer fits in a message.
+TEST_F(Queries, OfAllGroupsAreSentGroupByGroup) {
     query(3, "/qv/wccpd/wccp/srv_grp", bn_query_iterate, bn_qf_subtree);
     EXPECT_EQ(answer_last(1, {group(7), group(51)}), STATE + " 0");
     EXPECT_EQ(answer_last(1, {group(7), {STATE + "/7/oper", {bn_type_str, "INIT"}}}), STATE + "/7" + WALK);
@@ -129,7 +129,7 @@ TEST_F(Queries, OfAllGroupsGoGroupByGroup) {
     EXPECT_EQ(daemon.gathered_bytes + daemon.pending_bytes, 0u);
 }
 
-// What a client doesn't read leaves room for less and less.
+// Answers that a client has not read yet reduce the room for further ones.
 TEST_F(Queries, WhoseAnswersDoNotFitAreRefused) {
     ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"}}), 0u);
     daemon.fits = [](uint32_t peer_id, size_t bytes) { return peer_id == 3 && bytes < 200; };
@@ -150,7 +150,7 @@ TEST_F(Queries, ThatNobodyAnswers) {
     EXPECT_EQ(server_tick(&daemon), now + MONITOR_TIMEOUT_MS);
     (void)tick(MONITOR_TIMEOUT_MS);
     EXPECT_EQ(code(), static_cast<uint32_t>(LC_IO_TIMED_OUT));
-    // A walk of a node above succeeds without the daemon, whether that refuses or goes.
+    // A walk that begins above the states succeeds without the daemon, whether it refuses or disconnects.
     for (const bool refuses : {true, false}) {
         clear();
         query(3, "/qv/wccpd", bn_query_iterate, bn_qf_subtree);
@@ -164,7 +164,7 @@ TEST_F(Queries, ThatNobodyAnswers) {
     query(3, STATE + "/51/oper", bn_query_get);
     EXPECT_EQ(message(), "wccpd has no session");
 
-    // Of two daemons the one that goes half-way leaves nothing, whichever was asked for first.
+    // A daemon that disconnects half-way contributes nothing, whichever of two daemons was queried first.
     open(1, "wccpd-8");
     open(5, "tunneld-9");
     follow(1, {EVENT_CONFIG_CHANGE});

@@ -1,5 +1,5 @@
-// What the daemons report to mgmtd, and what becomes of it: processes, alarms, roles, and groups that are out
-// of their routers for a time.
+// Reports of the daemons to mgmtd: processes, alarms, roles, and groups that have left their routers for a
+// time.
 #include <cstring>
 
 #include <gtest/gtest.h>
@@ -8,7 +8,8 @@
 
 namespace {
 
-// A process has several sessions; another process id is a restart, and its predecessor's late end is none.
+// A process has several sessions. Another process ID is a restart, but the late end of its predecessor is
+// not.
 TEST_F(Mgmtd, ProcessesAreKnownByTheirSessions) {
     const auto wccpd = [](const char *state, const char *pid, const char *restarts) {
         const std::string root = NODE_PROCESSES "/wccpd";
@@ -26,7 +27,7 @@ TEST_F(Mgmtd, ProcessesAreKnownByTheirSessions) {
     EXPECT_EQ(walk(NODE_PROCESSES), wccpd("gone", "9", "1"));
 }
 
-// 3 restarts in 5 minutes raise an alarm, which ends 5 minutes after the last one; whoever counts them.
+// 3 restarts in 5 minutes raise an alarm, which ends 5 minutes after the last one.
 TEST_F(Mgmtd, ADaemonThatRestartsInALoopRaisesAnAlarm) {
     const auto alarm = [&](const char *process) {
         return value(NODE_ALARMS_RAISED "/196641/" + std::string(process));
@@ -66,7 +67,7 @@ TEST_F(Mgmtd, ADaemonThatRestartsInALoopRaisesAnAlarm) {
     EXPECT_EQ(heard(), 1u);
     EXPECT_EQ(alarm("wccpd"), "");
 
-    // The supervisor's word counts alone, also for a program that never has a session.
+    // Under a supervisor only its reports count, also for a program that never has a session.
     daemon.supervises = true;
     for (const char *session : {"wccpd-14", "wccpd-15", "wccpd-16"})
         restart(session, 1000);
@@ -90,13 +91,13 @@ TEST_F(Mgmtd, ReportsLastUntilTheirSessionEndsAndAreBounded) {
     EXPECT_EQ(sent[0].peer, 3u) << "passed on";
     EXPECT_EQ(sent[1].mtype, bn_msg_event_ack);
     raise(2, "eth0:grp:51", "again");
-    // A number that is none stops no walk.
+    // An invalid number does not break a walk.
     (void)report(2, EVENT_ROLE_CHANGE, {{"role", {bn_type_uint32, "1"}}, {"code", {bn_type_str, "many"}}});
     EXPECT_EQ(walk(NODE_ALARM_STATE).size(), 8u) << "three of them about the process";
     EXPECT_EQ(value(NODE_ROLES "/51") + value(NODE_ROLES "/51/code"), "BACKUP0");
     clear();
     close(2);
-    strings forgotten; // what watchers get
+    strings forgotten; // events that watchers get
     for (const sent_message &one : sent)
         for (const event_field &field : fields_of(one.request))
             forgotten.push_back(field.name + "=" + field.value.text);
@@ -139,8 +140,8 @@ struct OutOfRouters : Mgmtd {
 
 TEST_F(OutOfRouters, TheGroupIsDownForWccpdAlone) {
     const std::string left = NODE_LEFT_GROUPS "/51";
-    const auto seen = [&] { return value(admin, 1) + " " + value(admin); }; // by wccpd and others
-    std::string heard; // by a session that watches: l and j
+    const auto seen = [&] { return value(admin, 1) + " " + value(admin); }; // as seen by wccpd and others
+    std::string heard; // events of a watching session: l for leave, j for join
     const auto send = [&, original = daemon.send](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
         original(peer_id, mtype, frame);
         if (peer_id == 8 && mtype == bn_msg_event)
@@ -151,7 +152,7 @@ TEST_F(OutOfRouters, TheGroupIsDownForWccpdAlone) {
     follow(8, {EVENT_GROUP_LEAVE, EVENT_GROUP_JOIN});
     follow(3, {EVENT_CONFIG_CHANGE});
     const std::string saved = content();
-    EXPECT_EQ(leave(3), strings{}) << "only tunneld may say so";
+    EXPECT_EQ(leave(3), strings{}) << "only tunneld may report this";
     open(5, "tunneld-9");
     EXPECT_EQ(leave(5), goes);
     EXPECT_EQ(events(3).size(), 0u);
@@ -159,7 +160,7 @@ TEST_F(OutOfRouters, TheGroupIsDownForWccpdAlone) {
     EXPECT_EQ(content(), saved);
     EXPECT_EQ(value(left), "proxy down: status 503");
     EXPECT_EQ(leave(5), strings{}) << "it knows already";
-    // What is configured meanwhile does not bring the group up.
+    // Configuring the group meanwhile does not bring it up.
     for (const char *word : {"down", "up"}) {
         EXPECT_EQ(set({{bn_set_modify, admin, word}}), 0u);
         EXPECT_EQ(changes(), strings{});
@@ -172,7 +173,7 @@ TEST_F(OutOfRouters, TheGroupIsDownForWccpdAlone) {
     EXPECT_EQ(seen(), "up up");
     EXPECT_EQ(report(5, EVENT_GROUP_JOIN), strings{});
 
-    // tunneld goes: for a time another may take over.
+    // tunneld ends: for a time another one may take over.
     EXPECT_EQ(leave(5), goes);
     close(5);
     EXPECT_EQ(tick(LEFT_KEEP_MS - 1), strings{});
@@ -185,9 +186,9 @@ TEST_F(OutOfRouters, TheGroupIsDownForWccpdAlone) {
     EXPECT_EQ(server_tick(&daemon), now + LEFT_KEEP_MS);
     EXPECT_EQ(tick(LEFT_KEEP_MS), comes);
     EXPECT_EQ(value(left), "");
-    EXPECT_EQ(heard, "ljljlj") << "each change once, whoever reports it";
+    EXPECT_EQ(heard, "ljljlj") << "each change once";
 
-    // With the group it goes, and doesn't come back with it.
+    // The state ends with the group, and is not restored with it.
     open(7, "tunneld-11");
     EXPECT_EQ(leave(7), goes);
     EXPECT_EQ(set({{bn_set_delete, GROUP, ""}}), 0u);
@@ -197,7 +198,7 @@ TEST_F(OutOfRouters, TheGroupIsDownForWccpdAlone) {
     EXPECT_TRUE(has(changes(), admin + "=->up"));
 }
 
-TEST_F(OutOfRouters, AGroupThatIsDrainedAnnouncesNothingAndLeavesOnceItIsEmpty) {
+TEST_F(OutOfRouters, ADrainedGroupAnnouncesWeightZeroAndLeavesOnceItIsEmpty) {
     const std::string drain = NODE_DRAINS "/51";
     const auto slow_down = [&](const char *percent) {
         return report(5, EVENT_GROUP_WEIGHT, {{"percent", {bn_type_uint32, percent}}});
@@ -210,14 +211,14 @@ TEST_F(OutOfRouters, AGroupThatIsDrainedAnnouncesNothingAndLeavesOnceItIsEmpty) 
         return act(ACTION_DRAIN, {{field, {bn_type_str, number}}});
     };
     open(5, "tunneld-9");
-    // The steps of a slow start; what is configured meanwhile comes in its part. No step is less than 1.
+    // Steps of a slow start; a weight configured meanwhile is reduced as well. No step is less than 1.
     EXPECT_EQ(slow_down("20"), strings{weight + "=7>1"});
     EXPECT_EQ(slow_down("20"), strings{});
     EXPECT_EQ(slow_down("40"), strings{weight + "=1>2"});
     EXPECT_EQ(set({{bn_set_modify, weight, "10"}}), 0u);
     EXPECT_EQ(changes(), strings{weight + "=2>4"});
     EXPECT_EQ(value(weight), "10");
-    // A drain takes the rest, and a new tunneld may still follow.
+    // A drain overrides the slow start.
     EXPECT_EQ(begin("group", "51"), strings{weight + "=4>0"});
     EXPECT_EQ(server_tick(&daemon), now + 60000) << "the configured time";
     EXPECT_EQ(begin("seconds", "9"), strings{}) << "all groups, anew";
@@ -234,7 +235,7 @@ TEST_F(OutOfRouters, AGroupThatIsDrainedAnnouncesNothingAndLeavesOnceItIsEmpty) 
     EXPECT_EQ(value(drain), "");
     EXPECT_EQ(act(ACTION_DRAIN_CANCEL), strings{});
     EXPECT_EQ(message(), "There is no drain");
-    // Without tunneld, or with flows that don't end, by its time.
+    // Without tunneld, or with flows that do not end, the time limit ends the drain.
     for (const bool followed : {false, true}) {
         if (followed) {
             open(5, "tunneld-10");
@@ -249,7 +250,7 @@ TEST_F(OutOfRouters, AGroupThatIsDrainedAnnouncesNothingAndLeavesOnceItIsEmpty) 
         EXPECT_EQ(value(drain), "over");
         (void)act(ACTION_DRAIN_CANCEL, {{"group", {bn_type_uint8, "51"}}});
     }
-    // What a tunneld that is gone for good has slowed down gets its weight back.
+    // A group slowed down by a tunneld that does not return gets its weight back.
     close(5);
     EXPECT_EQ(tick(LEFT_KEEP_MS - 1), strings{});
     EXPECT_EQ(tick(1), strings{weight + "=8>10"});

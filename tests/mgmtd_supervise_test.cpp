@@ -1,4 +1,4 @@
-// Processes that mgmtd starts, or whose ends it sees by their sessions.
+// Processes that mgmtd starts, or whose ends it detects by their sessions.
 #include <csignal>
 
 #include <gtest/gtest.h>
@@ -13,7 +13,7 @@ namespace {
 
 using strings = std::vector<std::string>;
 
-// "tunneld", which takes over, is "sleep 100"; the time stands still.
+// "tunneld", which takes over, is "sleep 100". Time moves only when a test moves it.
 struct Supervision : testing::Test {
     supervisor self;
     int64_t now = 100000;
@@ -47,7 +47,7 @@ struct Supervision : testing::Test {
         pollfd ended = {of->children[0].pidfd, POLLIN, 0};
         EXPECT_EQ(poll(&ended, 1, 5000), 1);
     }
-    // Ends after a run of so long. Gives the time of the next thing to do, from then on.
+    // Ends the process after a run of that length. Returns the time until the next tick.
     int64_t end(int signal, int64_t ran_ms) {
         now += ran_ms;
         kill(tunneld->pid, signal);
@@ -72,7 +72,7 @@ TEST_F(Supervision, AnEndHasItsNameAndTheNextStartItsDelay) {
     EXPECT_STREQ(end_event(W_EXITCODE(0, 0), true), EVENT_PROCESS_TERMINATE);
 }
 
-// Of a mgmtd that was killed: the program is ending, and cannot be started beside itself.
+// After mgmtd was killed: the child of the killed one must end before the next is started.
 TEST_F(Supervision, AnEarlierRunEndsFirst) {
     supervisor earlier = self;
     for (supervisor *each : {&earlier, &self})
@@ -82,7 +82,7 @@ TEST_F(Supervision, AnEarlierRunEndsFirst) {
     EXPECT_EQ(supervisor_tick(&self), now + EARLIER_RUN_EVERY_MS);
     (void)tick(EARLIER_RUN_EVERY_MS);
     EXPECT_EQ(said, "process tunneld: an earlier one still runs; waits for its end\n");
-    kill(earlier.children[0].pid, SIGKILL); // its end counts before anybody has waited for it
+    kill(earlier.children[0].pid, SIGKILL); // its end counts before it has been reaped
     await_end(&earlier);
     (void)tick(EARLIER_RUN_EVERY_MS);
     EXPECT_FALSE(supervisor_is_done(self));
@@ -92,8 +92,8 @@ TEST_F(Supervision, AnEarlierRunEndsFirst) {
     unlink("/tmp/slow.lock");
 }
 
-// Its number may be another process's by then.
-TEST_F(Supervision, AChildThatSomebodyElseWaitedForIsOver) {
+// Its process ID may have been reused.
+TEST_F(Supervision, AChildReapedElsewhereHasEnded) {
     tunneld->takes_over = false;
     (void)supervisor_tick(&self);
     kill(tunneld->pid, SIGKILL);
@@ -103,8 +103,8 @@ TEST_F(Supervision, AChildThatSomebodyElseWaitedForIsOver) {
     EXPECT_EQ(events, strings{"tunneld" EVENT_PROCESS_EXIT});
 }
 
-// tunneld is killed: whether anybody hears of it depends on how soon the next one has its session.
-TEST_F(Supervision, ALossIsReportedWhenNobodyTakesOverInTime) {
+// tunneld is killed: the loss is reported unless the next one has its session in time.
+TEST_F(Supervision, ALossIsReportedUnlessTheNextTakesOverInTime) {
     (void)supervisor_tick(&self);
     open_session();
     EXPECT_EQ(end(SIGKILL, 1000), TAKE_OVER_MS);
@@ -117,7 +117,7 @@ TEST_F(Supervision, ALossIsReportedWhenNobodyTakesOverInTime) {
     EXPECT_EQ(tick(1), -1);
     EXPECT_EQ(events, strings{});
 
-    // Too late; and the one that never had a session is started by the usual delays, within the same loss.
+    // Too late; a process that never had a session is restarted after the usual delays, within the same loss.
     EXPECT_EQ(end(SIGKILL, 1000), TAKE_OVER_MS);
     EXPECT_EQ(end(SIGKILL, 10), RESTART_DELAY_FIRST_MS);
     EXPECT_EQ(events, strings{});
@@ -125,13 +125,13 @@ TEST_F(Supervision, ALossIsReportedWhenNobodyTakesOverInTime) {
     EXPECT_EQ(events, strings{"tunneld" EVENT_PROCESS_CRASH});
     open_session();
     EXPECT_EQ(said.find("replaced after 30"), std::string::npos) << said;
-    // One that ends as soon as it has taken over is not started again and again without a pause.
+    // One that ends soon after it has taken over is restarted with a delay.
     EXPECT_GT(end(SIGKILL, SHORT_RUN_MS - 1), 0);
     EXPECT_TRUE(supervisor_is_done(self));
     (void)tick(RESTART_DELAY_MAX_MS);
     EXPECT_EQ(restarts, strings(4, "tunneld ended by SIGKILL"));
 
-    // An orderly end is reported at once, and so is the end of everything.
+    // An orderly end is reported immediately, and so is the end of mgmtd.
     events.clear();
     open_session();
     EXPECT_GE(end(SIGTERM, 1000), RESTART_DELAY_FIRST_MS);
@@ -146,12 +146,12 @@ TEST_F(Supervision, ALossIsReportedWhenNobodyTakesOverInTime) {
     EXPECT_TRUE(supervisor_is_done(self));
 }
 
-// Started by systemd, say: mgmtd sees sessions, and what the process itself reports.
-TEST_F(Supervision, SomebodyElsesProcessIsKnownByItsSessions) {
+// Started by systemd: mgmtd knows the sessions, and the reports of the process itself.
+TEST_F(Supervision, AProcessStartedElsewhereIsKnownByItsSessions) {
     self.children = {{"tunneld", {}}, {"wccpd", {}}};
     tunneld = &self.children[0];
     tunneld->takes_over = true;
-    EXPECT_EQ(supervisor_tick(&self), -1) << "nobody is started";
+    EXPECT_EQ(supervisor_tick(&self), -1) << "nothing is started";
     supervisor_session_opened(&self, "tunneld-7");
     supervisor_session_closed(&self, "tunneld-7");
     EXPECT_EQ(supervisor_tick(&self), now + TAKE_OVER_MS);
@@ -160,7 +160,7 @@ TEST_F(Supervision, SomebodyElsesProcessIsKnownByItsSessions) {
     EXPECT_EQ(said, "process tunneld: its session is lost, replaced after 40 ms\n");
     EXPECT_EQ(supervisor_tick(&self), -1);
 
-    // An orderly end is reported by the process, and the end of its session is no second one.
+    // An orderly end is reported by the process; the end of its session is not a second one.
     EXPECT_TRUE(supervisor_take_report(&self, "tunneld"));
     supervisor_session_closed(&self, "tunneld-9");
     EXPECT_EQ(supervisor_tick(&self), -1);

@@ -1,5 +1,5 @@
 // mgmtd without sockets: messages are kept instead of being sent. Change events are read with the client
-// library that wccpd reads them with.
+// library that wccpd uses.
 #pragma once
 
 #include <algorithm>
@@ -44,7 +44,7 @@ struct Mgmtd : testing::Test {
     int64_t now = 1000;
     std::vector<sent_message> sent;
     std::string said;
-    uint32_t asker = 3; // whose set requests are
+    uint32_t asker = 3; // sends the set requests
     char file[32] = "/tmp/mgmtd-test-XXXXXX";
 
     void SetUp() override {
@@ -111,8 +111,7 @@ struct Mgmtd : testing::Test {
     }
     void open(uint32_t peer_id, const char *name) { server_peer_opened(&daemon, peer_id, name); }
     void close(uint32_t peer_id) { server_peer_closed(&daemon, peer_id); }
-    // What wccpd gets when an action of group 51, or of no group, is carried out; an event of it is taken;
-    // the time is so much later.
+    // The changes that wccpd gets after an action, after an event about group 51, or after that time.
     strings act(const char *name, const std::vector<event_field> &fields = {}) {
         clear();
         action(3, name, fields);
@@ -202,7 +201,7 @@ struct Mgmtd : testing::Test {
         std::erase_if(out, [](const std::string &node) { return node.find("/since=") != std::string::npos; });
         return out;
     }
-    // What the daemon makes of each change event that the peer was sent: "name=old>new", "-" for none.
+    // The change events that were sent to the peer: "name=old>new", "-" for none.
     std::vector<strings> events(uint32_t peer_id = 1) {
         std::vector<strings> out;
         for (const sent_message &one : sent) {
@@ -235,7 +234,7 @@ struct Mgmtd : testing::Test {
             out.insert(out.end(), event.begin(), event.end());
         return out;
     }
-    // The file with this content, and what mgmtd makes of it.
+    // Writes the file and has mgmtd read it again.
     void reload(const std::string &content) {
         std::ofstream(daemon.file.path) << content;
         clear();
