@@ -1,5 +1,5 @@
 #!/bin/bash
-# Commands are run at changes of a group's role, of alarms and of a proxy's health, by a service that is nobody.
+# Commands are run at changes of a group's role, of alarms and of a proxy's health, by an unprivileged service.
 #   scenario_notify.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 : "${LAB_SPEED:=8}" "${LAB_PLANE=}"
@@ -12,7 +12,7 @@ run=/run/wccpd/notify
 notify_start() {
     lab_start a1 notify mgmtctl notify run --directory $run/d --state $run/state/reported --user nobody --limit 1
 }
-# What the first command has been run for since the last call: these changes, in this order, and no others before the last.
+# Expects these changes in the log of the first command since the last call, in this order and no others.
 reported() { # SECONDS "KIND PREVIOUS>STATE REASON"...
     local wanted limit=$1; shift
     wanted=$(printf '%s\n' "$@")
@@ -39,7 +39,7 @@ case_changes() {
     lab_gateway a1 10.0.0.1
     lab_proxy a1 3129
     lab_appliance_start a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 interval=1 rise=1 fall=1 leave_after=0)"
-    ready 51 a1
+    wait_ready 51 a1
     notify_start
     reported 20 'role UNKNOWN>ACTIVE ' 'health unknown>up '
     lab_wait_line 5 'refused: .*/writable: others than root may write to it' "$LAB/a1-notify.out" || die "not refused"
@@ -50,21 +50,23 @@ case_changes() {
     reported 30 'role ACTIVE>BACKUP router-silent' 'alarm cleared>raised router-silent'
     lab_wait_line 10 '20-slow: not done after 1 s, ended' "$LAB/a1-notify.out" || die "not ended"
     # shellcheck disable=SC2016
-    lab_in a1 bash -c '! kill -0 $(cat '$run'/out/pid)' 2>/dev/null || die "what a command has started goes on"
+    lab_in a1 bash -c '! kill -0 $(cat '$run'/out/pid)' 2>/dev/null || die "a child of the command is left running"
     lab_in a1 grep -qx '65534 51 adjacency 10.0.0.1 has stopped answering: no I-See-You for 40 s' $run/out/more || die "$(lab_in a1 cat $run/out/more)"
     lab_ctl r1 resume >/dev/null
     reported 40 'role BACKUP>ACTIVE ' 'alarm raised>cleared '
 
-    # What happens meanwhile is reported by the next one.
+    lab_wait 10 '. == 2' grep -c '20-slow: not done' "$LAB/a1-notify.out" || die "the command of the cleared alarm did not end"
+
+    # Changes while the service is stopped are reported after the next start.
     lab_stop a1 notify || die "ended with $?"
     lab_proxy a1 3129
-    ready 51 a1
+    wait_ready 51 a1
     notify_start
     reported 10 'health down>up '
     lab_stop a1 wccpd || die "ended with $?"
     reported 10 'role ACTIVE>UNKNOWN wccpd-absent'
     lab_wccpd_start a1
-    role a1 40 51 ACTIVE
+    wait_role a1 40 51 ACTIVE
     lab_wait 20 '. == "ACTIVE"' eval "lab_in a1 awk '/^role/ { sub(/.*>/, \"\", \$2); last = \$2 } END { print \"\\\"\" last \"\\\"\" }' $run/out/log" || die "not reported"
     seen=$(lab_in a1 cat $run/out/log | wc -l)
     # mgmtd is gone: wccpd ends, and the service waits for both.

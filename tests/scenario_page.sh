@@ -1,9 +1,9 @@
 #!/bin/bash
-# The page of "mgmtctl show --html": two appliances with redirected flows, and two routers, one of which has another table
-# than is wanted. The file and the exit codes; then a headless browser, in which the page renders without an error and
-# without loading anything, in light and dark, narrow and wide. Without chromium the second half is skipped.
+# The page of "mgmtctl show --html": two appliances with redirected flows, and two routers, one of which does not have the
+# wanted table. Checks the file and the exit codes, then opens the page in a headless browser, where it must render without
+# errors and load nothing: light and dark, narrow and wide. The part with the browser is skipped without chromium.
 #   scenario_page.sh DIRECTORY_OF_THE_PROGRAMS
-#   LAB_PAGE   a directory to which the page is copied, with pictures of it
+#   LAB_PAGE   a directory to which the page is copied, with screenshots
 set -u
 : "${LAB_SPEED:=8}" "${LAB_PLANE=}"
 export WCCP_BIN=${1:-$(dirname "$0")/../build/release/bin} LAB_SPEED LAB_PLANE
@@ -25,18 +25,18 @@ lab_router r1 10.0.0.1 -- --redirect c1=51 --forward gre --return gre
 lab_router r2 10.0.0.2 -- --forward gre --return gre
 lab_client c1 r1
 lab_server s1 r1
-proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1 10.0.0.2 weight=100)" "$(lab_intercept 51 'ports=80 8000-8010')"
-proxied a2 10.0.0.102 '' "$(lab_group 51 10.0.0.1 10.0.0.2 weight=200)" "$(lab_intercept 51 'ports=80 8000-8010')"
-ready 51 a1 a2
+start_proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1 10.0.0.2 weight=100)" "$(lab_intercept 51 'ports=80 8000-8010')"
+start_proxied a2 10.0.0.102 '' "$(lab_group 51 10.0.0.1 10.0.0.2 weight=200)" "$(lab_intercept 51 'ports=80 8000-8010')"
+wait_ready 51 a1 a2
 lab_fetch c1 --count 112 --sources 112 >/dev/null
 lab_fetch c1 --count 8 --sources 8 --port 8080 >/dev/null
 nsenter -t "${LAB_INIT[c1]}" --net "$WCCP_BIN/wccp_router" fetch --from 10.1.0.128 --sources 112 10.2.0.2 --long 40 --life 600 >"$LAB/flows" &
 LAB_PID[c1/client]=$!
-state_is a1 20 intercept '.["51"].flows > 5'
+tunneld_is a1 20 intercept '.["51"].flows > 5'
 lab_wait 40 '[.reasons[] | select(.attention)] == []' eval 'show --json' || die "something needs attention: $(show)"
 page 0 '<h1>Nothing needs attention</h1>' cache1 'as wanted'
 
-# --- One router has something else
+# --- One router has another table
 
 lab_ctl r2 assign 51 40 55 10.0.0.102 >/dev/null
 lab_ctl r2 assign 51 200 203 none >/dev/null
@@ -89,17 +89,18 @@ if command -v chromium >/dev/null; then
     looks 1 'rgb(244, 246, 248)'
     looks 0 'rgb(18, 22, 27)'
 else
-    echo 'chromium is not installed: not looked at in a browser'
+    echo 'skipped: chromium is not installed, the page is not opened in a browser'
     skipped=77
 fi
 
-# --- What is unknown
+# --- Programs that do not answer
 
-lab_stop a1 tunneld || die "tunneld: $?"
-page 0 'tunneld has no session' '<code>tunneld-absent</code>'
+kill -STOP "$(lab_pid a1 tunneld)"
+page 0 'tunneld does not answer' '<code>tunneld-silent</code>'
+lab_continue a1 tunneld
 kill -STOP "$(lab_pid a1 wccpd)"
-page 3 '<h1>wccpd does not answer</h1>' 'state unknown' '<dt>Alarms</dt><dd><span class="badge unknown">'
-kill -CONT "$(lab_pid a1 wccpd)" "${LAB_PID[a1/wccpd]}"
+page 3 '<h1>wccpd does not answer</h1>' 'state unknown'
+lab_continue a1 wccpd
 lab_stop a1 mgmtd KILL 2>/dev/null
 page 3 '<h1>mgmtd does not answer</h1>'
 grep -q 'mgmtd is not running' "$LAB/complained" || die 'no error'
