@@ -278,7 +278,7 @@ case_fleet() {
     [ "$(lab_manage a1 history | jq -c '.[0] | [.cause, .confirm_by]')" = '["apply",null]' ] || die "a1 is not confirmed"
     [ "$(lab_manage a3 history | jq length)" = 1 ] || die "a3 is changed"
     lab_group 51 10.0.0.1 weight=7 >"$file"
-    FLEET_HEALTH=false fleet 1 $'a2: is not well, and undoes the change in 5 minutes\nhalted; not yet reached: a3' --batch 2 --merge "$file" a2 a3
+    FLEET_HEALTH=false fleet 1 $'a2: is not healthy, and undoes the change in 5 minutes\nhalted; not yet reached: a3' --batch 2 --merge "$file" a2 a3
     lab_in a2 "$WCCP_BIN/mgmtctl" confirm >/dev/null || die "a2 does not wait"
     fleet 1 "a2: nothing to change"$'\n'"a3: modify /qv/wccpd/wccp/srv_grp/config/51/weight = 7 (was 100)" --check --merge "$file" a2 a3
     fleet 0 $'a2: unchanged\na3: changed' --merge "$file" a2 a3
