@@ -197,9 +197,10 @@ cp $here/root/etc/wccpd/mgmtd.conf $here/conf
 mkdir $here/new && dpkg-deb -R "$work"/wccpd_*.deb $here/new && sed -i 's/^Version: .*/&+1/' $here/new/DEBIAN/control &&
     dpkg-deb --root-owner-group -b $here/new $here/root/root/deb/new.deb >/dev/null || die "cannot build a newer package"
 until_true 20 is_up "${services[@]}"
-old=$(main_pid wccpd)
+old=$(main_pid wccpd) old_notify=$(main_pid wccp-notify)
 install_package /root/deb/new.deb
 wait_restarted 20 wccpd "$old"
+wait_restarted 20 wccp-notify "$old_notify"
 is_kept() {
     cmp -s $here/conf $here/root/etc/wccpd/mgmtd.conf && grep -q '# edited' $here/root/etc/opt/rvl/platform.conf &&
         [ "$(stat -c %a $here/root/etc/wccpd/mgmtd.conf)" = 600 ] && is_up "${services[@]}"
@@ -217,7 +218,7 @@ until_true 20 eval '[ "$(inside systemctl is-active "${services[@]}" | sort -u)"
 inside systemctl start wccp.target && until_true 20 is_up "${services[@]}" || die "the services did not start with the target"
 
 inside dpkg --purge wccpd >$here/dpkg.log 2>&1 || { cat $here/dpkg.log; die "dpkg"; }
-! inside ps -A -o comm= | grep -qxE 'wccpd|tunneld|mgmtd' || die "programs are left running"
+! inside ps -A -o comm= | grep -qxE 'wccpd|tunneld|mgmtd|mgmtctl' || die "programs are left running"
 left=$(cd $here/root && ls -d etc/wccpd var/lib/wccp-notify etc/opt/rvl var/opt/rvl run/tunneld run/wccpd.pid run/mgmtd.lock usr/sbin/wccpd \
     etc/systemd/system/*.wants/{wccp,mgmtd,tunneld}* tmp/gcl-socks/* 2>/dev/null
     inside sh -c 'cd /; ls -d /run/tunneld /run/wccpd.pid /run/mgmtd.lock /tmp/gcl-socks/* 2>/dev/null; ip -o link show group 2048')
