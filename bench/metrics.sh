@@ -17,6 +17,7 @@ die() { echo "$*" >&2; tail -n 8 "$LAB/a1.log" "$LAB"/a1-*.out >&2; exit 1; }
 addresses=(); for i in $(seq 32); do addresses+=("10.0.0.$i"); done
 lab_router r1 "${addresses[@]}"
 lab_appliance a1 10.0.0.101
+LAB_FOUND[a1]=$(lab_remains a1)
 awk -v groups="$groups" 'BEGIN {
     for (id = 255; id > 255 - groups; id--) {
         printf "[/qv/wccpd/wccp/srv_grp/config/%d]\ninterface = eth0\npriority = %d\n", id, id
