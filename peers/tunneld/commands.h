@@ -1,6 +1,7 @@
-// tunneld as wccpd sees it: takes commands from the mailbox, keeps the table of tunnels, answers and prints
-// each command. What a tunnel is made of is the caller's: `apply` is called after each change of the table.
-// Also knows which wccpd has ordered the tunnels: those that a new one doesn't order go after a time.
+// The side of tunneld that wccpd sees: takes commands from the mailbox, keeps the table of tunnels, answers
+// and prints each command. The caller makes the tunnels: `apply` is called after each change of the table.
+// Also keeps track of which wccpd has ordered the tunnels; those that a new wccpd does not order again are
+// removed.
 #pragma once
 
 #include <cstdint>
@@ -13,18 +14,18 @@
 
 #include <nlohmann/json_fwd.hpp>
 
-// Tunnels that a new wccpd does not order go after this time.
+// How long after the start of a new wccpd tunnels stay that it has not ordered again.
 constexpr int64_t UNORDERED_MS = 60000;
-// The process id of the wccpd that the tunnels were ordered by, for the next tunneld.
+// Keeps the process id of the wccpd that has ordered the tunnels, for the next tunneld.
 constexpr char WCCPD_FILE[] = "/run/tunneld/wccpd";
 
 struct command_options {
-    uint32_t first_index = 1; // without `apply`: index of the first tunnel, WCCP_NO_INDEX gives none to any
-    uint32_t slow_ms = 0;     // time that a command takes
+    uint32_t first_index = 1; // without `apply`: index of the first tunnel; WCCP_NO_INDEX: no tunnel gets one
+    uint32_t slow_ms = 0;     // how long each command takes
     bool refuse = false;      // every command fails
     bool silent = false;      // no command is answered
-    bool json = false;        // one JSON object a line
-    bool roles = false;       // changes of policy group roles are printed too
+    bool json = false;        // prints one JSON object for each line
+    bool roles = false;       // also prints changes of policy group roles
 };
 
 struct command_tunnel {
@@ -32,7 +33,7 @@ struct command_tunnel {
     uint32_t index;         // of the interface
 };
 
-// A command as it was found in the mailbox.
+// A command as read from the mailbox; addresses in host order.
 struct mailbox_command {
     uint16_t code;
     uint16_t tunnel_id;
@@ -45,43 +46,44 @@ struct mailbox_command {
 struct command_desk {
     command_options options;
     FILE *out = stdout;
-    // Makes what the table says, and fills in the indices: WCCP_NO_INDEX where there is no interface. Null:
-    // indices are handed out from `first_index`.
+    // Makes the tunnels of the table and fills in their indices: WCCP_NO_INDEX for a tunnel without an
+    // interface. Null: no tunnels are made, and indices are assigned from `first_index` on.
     std::function<void(std::map<uint16_t, command_tunnel> *tunnels)> apply;
     std::function<void(uint8_t group, bool forced)> set_l2_return;
 
     bool attached = false;
     uint32_t next_index = 0;
     std::map<uint16_t, command_tunnel> tunnels;
-    std::set<uint16_t> ordered;                 // tunnel ids that the present wccpd has ordered
-    std::optional<mailbox_command> passed_over; // the command that is left unanswered, printed once
-    std::map<uint16_t, uint32_t> roles;         // of policy groups, where not UNKNOWN
-    int32_t wccpd_pid = 0;                      // that the tunnels were ordered by; 0 unknown
-    bool wccpd_lives = false;                   // by the last look
-    int64_t unordered_until_ms = -1;            // -1: no tunnel waits to be ordered anew
+    std::set<uint16_t> ordered;                 // tunnel ids that the running wccpd has ordered
+    std::optional<mailbox_command> passed_over; // with `silent`: the pending command, once it was printed
+    std::map<uint16_t, uint32_t> roles;         // by policy group, without UNKNOWN ones
+    int32_t wccpd_pid = 0;                      // of the wccpd that has ordered the tunnels; 0: unknown
+    bool wccpd_lives = false;                   // by the last watch_wccpd()
+    int64_t unordered_until_ms = -1;            // when drop_unordered() removes tunnels; -1: never
 };
 
 // False, with a line in the log, when shared memory cannot be used.
 bool start_commands(command_desk *desk, const command_options &options, FILE *out);
-// Takes the pending command, if there is one. False when there was nothing to do. `out_end` is set when a
-// signal came while the command was under way.
+// Executes and answers the pending command. False when there is none. `out_end`: a signal has interrupted the
+// command, which happens only with `slow_ms`.
 bool take_command(command_desk *desk, bool *out_end);
-// Looks whether wccpd has been started anew. To be called now and then; take_command() does it too, before it
-// takes a command of a wccpd that has only just been started.
+// Notices that a new wccpd has been started. To be called about once a second; take_command() also does it,
+// because the first command of a new wccpd can come before that.
 void watch_wccpd(command_desk *desk, int64_t now_ms);
-// Removes the tunnels whose time is over.
+// Removes the tunnels that the new wccpd has not ordered within UNORDERED_MS.
 void drop_unordered(command_desk *desk, int64_t now_ms);
-// At an orderly end, after which there are no tunnels.
+// Removes WCCPD_FILE. For an orderly end, which leaves no tunnels.
 void forget_wccpd();
-// The socket by which wccpd wakes this process (platform/tunnel_mailbox.h), in the place of one that a killed
-// tunneld has left; -1, with a line in the log, when there can't be one. The caller holds the lock that keeps
-// other tunnelds away.
+// Opens the socket at which wccpd wakes this process (platform/tunnel_mailbox.h); replaces one that a killed
+// tunneld has left. -1, with a line in the log, when it cannot be opened. The caller holds the lock that
+// keeps a second tunneld from running.
 int open_wake_up();
-void take_wake_ups(int fd);
+void take_wake_ups(int fd); // reads all datagrams
 void close_wake_up(int *inout_fd);
-// The time to the next look at the mailbox, by the time since the last command or the start. `is_woken`: a
-// command comes with a wake-up, and looking for one is a second chance.
+// How long to wait before the next poll of the mailbox. `quiet_ms`: time since the last command or the start.
+// `is_woken`: the wake-up socket is open, and polling only covers lost datagrams.
 int64_t mailbox_pause_ms(bool attached, bool is_woken, int64_t quiet_ms);
+// Prints the roles of policy groups that have changed since the last call.
 void print_roles(command_desk *desk);
-// One line to `out`: the object, or the text.
+// Prints one line to `desk.out`: the object with `json`, otherwise the text.
 void print_line(const command_desk &desk, const nlohmann::ordered_json &line, const std::string &text);

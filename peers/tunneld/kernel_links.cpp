@@ -57,7 +57,7 @@ link_counters read_statistics(const nlattr *attribute) {
     counters.bytes_in = all.rx_bytes;
     counters.packets_out = all.tx_packets;
     counters.bytes_out = all.tx_bytes;
-    // What the kernel's GRE counts on the link; packets of an unknown source never get that far.
+    // The kernel counts these on the link. Packets of an unknown source belong to no link.
     counters.refused[REFUSED_CHECKSUM] = all.rx_crc_errors;
     counters.refused[REFUSED_LENGTH] = all.rx_length_errors;
     counters.refused[REFUSED_INNER] = all.rx_frame_errors;

@@ -59,7 +59,7 @@ netlink_message route_message(int type, int flags, const wanted_route &route, ui
     header.rtm_protocol = ROUTE_PROTOCOL;
     header.rtm_type = route_type;
     if (type == RTM_DELROUTE)
-        header.rtm_scope = RT_SCOPE_NOWHERE; // any
+        header.rtm_scope = RT_SCOPE_NOWHERE; // in a delete request: any scope
     else if (route.local)
         header.rtm_scope = RT_SCOPE_HOST;
     else
@@ -120,7 +120,7 @@ netlink_message rule_message(int type, int flags, const wanted_rule &rule) {
 int find_routes(std::vector<found_route> *out) {
     rtmsg header = {};
     header.rtm_family = AF_INET;
-    header.rtm_protocol = ROUTE_PROTOCOL; // a host may have a million others
+    header.rtm_protocol = ROUTE_PROTOCOL; // filtered by the kernel: a host may have a million other routes
     const auto message = make_netlink_message(RTM_GETROUTE, NLM_F_DUMP, &header, sizeof header);
     return query_kernel(
         message.get(), [out](nlmsghdr *answer) { read_route(answer, out); }, [out] { out->clear(); });

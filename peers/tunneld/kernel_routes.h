@@ -1,5 +1,6 @@
-// Routes and rules of ours in the kernel. What is missing is added in one step and what is too much removed
-// in a later one, since other changes have their place between them.
+// tunneld's routes and rules in the kernel. Adding missing ones and removing surplus ones are separate
+// functions, since reconciliation changes other things in between. Functions that return an int return 0 or
+// an errno.
 #pragma once
 
 #include <string>
@@ -7,7 +8,7 @@
 
 #include "peers/tunneld/wanted_state.h"
 
-// As they are in the kernel; `odd` ones carry our mark, but are none that could be wanted.
+// As found in the kernel. An `odd` one has tunneld's protocol number, but attributes that tunneld never sets.
 struct found_route {
     wanted_route route;
     int out_index = 0;
@@ -24,10 +25,11 @@ struct found_rule {
 int find_routes(std::vector<found_route> *out);
 int find_rules(std::vector<found_rule> *out);
 
-// Adds the route, or replaces the one of the same table in one step.
+// Adds the route, or replaces the one in the same table atomically.
 int put_route(const wanted_route &route);
-int remove_route(const found_route &route); // one that is gone is no error
-int add_rule(const wanted_rule &rule);      // one that is there is no error
-int remove_rule(const wanted_rule &rule);   // one that is gone is no error
+int remove_route(const found_route &route); // 0 also when it is already gone
+int add_rule(const wanted_rule &rule);      // 0 also when it already exists
+int remove_rule(const wanted_rule &rule);   // 0 also when it is already gone
+// For error messages.
 std::string route_text(const wanted_route &route);
 std::string rule_text(const wanted_rule &rule);

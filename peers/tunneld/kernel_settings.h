@@ -1,5 +1,5 @@
-// Settings of interfaces, below /proc/sys/net/ipv4/conf. What was there before is kept in a state file, so
-// that the next tunneld can bring it back when this one is killed.
+// Settings of interfaces, below /proc/sys/net/ipv4/conf. The values from before are kept in a state file, so
+// that the next tunneld can restore them when this one is killed.
 #pragma once
 
 #include <string>
@@ -7,12 +7,13 @@
 
 #include "peers/tunneld/wanted_state.h"
 
-// Writes what differs. Where one of `all` is lowered, each other interface (and `default`) is raised to what
-// `all` had, since the larger of the two counted for it. Goes on after a failure and gives the first one.
+// Writes the settings that differ. Where a setting of `all` is lowered, the other interfaces and `default`
+// are raised to the old value of `all`: for an interface, the larger of its own value and that of `all`
+// counts. Goes on after a failure and returns the first one.
 bool apply_settings(const std::vector<wanted_setting> &wanted, std::string *out_error);
-// Brings back what is no longer wanted, unless somebody else has changed it since, and removes the file with
-// the last of them.
+// Restores the settings that are no longer wanted, except those that somebody else has changed since. Removes
+// the state file when nothing is left in it.
 bool restore_settings(const std::vector<wanted_setting> &wanted, std::string *out_error);
 
-// IPv6 is of no use on a link: its own packets would go to the router.
+// Tunnels carry IPv4 only, and without this the kernel's own IPv6 packets would go out by the link.
 void disable_ipv6(const std::string &interface);

@@ -49,7 +49,7 @@ std::optional<link_wish> parse_link_alias(const std::string &alias) {
         return std::nullopt;
     for (size_t kind = 0; kind < std::size(kind_words); kind++) {
         const link_wish wish = {id, ntohl(from.s_addr), ntohl(to.s_addr), static_cast<link_kind>(kind)};
-        if (link_alias(wish) == alias) // written in any other way: not by us
+        if (link_alias(wish) == alias) // otherwise tunneld has not written it
             return wish;
     }
     return std::nullopt;

@@ -4,7 +4,7 @@
 
 namespace {
 
-nft_ctx *context; // kept: closing one waits for the kernel to finish what it deletes
+nft_ctx *context; // kept open: closing it waits until the kernel has freed all that was deleted
 
 bool open_nft(std::string *out_error) {
     if (context)
@@ -19,7 +19,7 @@ bool open_nft(std::string *out_error) {
     return true;
 }
 
-// "Error: MESSAGE" is followed by the command, and by marks below its wrong part.
+// One line from an error of several: "Error: MESSAGE", the command, and marks below its wrong part.
 std::string shorten_error(const std::string &text) {
     constexpr size_t longest_command = 200;
     size_t from = text.find("Error: ");

@@ -1,6 +1,6 @@
-// Packets that the user-space plane passes on by the bucket in their redirect header: of TCP, without
-// starting a flow. Whether this host has their flow after all, the kernel says: they are given to it by an
-// interface of their own.
+// Selects the packets that the data plane `user` passes on to another appliance by the bucket in their
+// redirect header: TCP packets that do not begin a flow. Whether this host has their flow after all is found
+// out by the kernel: they are written to an interface of kind `passing`, whose rules look for a socket first.
 #pragma once
 
 #include <bitset>
@@ -13,7 +13,7 @@
 #include "peers/tunneld/gre.h"
 #include "peers/tunneld/plane.h"
 
-// The same, as it is looked up for each packet.
+// A passing_group in a form that is fast to look up for each packet.
 struct passing_service {
     uint32_t local;
     bool by_source_port;
@@ -25,9 +25,9 @@ struct passing_lookup {
     bool any = false;
 };
 void fill_passing_lookup(const passing_table &table, passing_lookup *out);
-// The member that gets the packet, or 0, and this host's end of the link.
+// The member that the packet is passed on to, or 0. `out_local`: this host's end of the link to it.
 uint32_t find_passing_member(const passing_lookup &lookup, const gre_content &content, uint32_t *out_local);
 
-// The table as lines for a file, and back. What cannot be read is left out.
+// Between the table and the lines of a file. Lines that cannot be read are left out.
 std::string passing_file_text(const passing_table &table);
 passing_table read_passing_file(const std::string &text);

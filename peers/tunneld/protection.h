@@ -1,5 +1,5 @@
-// Protection of flows whose slot has moved: what wccpd says of the owners of slots, kept beyond the life of
-// the process, and what follows from it for the view.
+// Flow protection: keeps what wccpd reports about the owners of slots, in files that outlive the process, and
+// derives from it which packets are passed on to other appliances.
 #pragma once
 
 #include <cstdint>
@@ -14,26 +14,27 @@
 constexpr const char *OWNERS_FILE = "/run/tunneld/owners";
 constexpr const char *PASSING_FILE = "/run/tunneld/passing";
 
-// What an earlier tunneld has kept. A file that is missing or bad is an empty table. The kernel keeps what it
-// passes on itself; for the user-space plane it is the second.
+// Load what an earlier tunneld has saved; a missing or damaged file is an empty table. The passing table is
+// that of the data plane `user`: with the plane `kernel`, the rules in the kernel outlive the process by
+// themselves.
 owners_table load_owners();
 passing_table load_passing();
 void save_passing(const passing_table &table);
-// Takes in wccpd's text about a group and keeps what has changed. True when something has.
+// Updates the table with wccpd's text about a group, and saves it if it has changed. True when it has.
 bool take_owners(owners_table *owners, uint8_t group, const std::string &text, uint32_t protection_s);
-// Drops groups that are no longer configured.
+// Drops the groups that are not in `groups`, and saves the table if there were any.
 void keep_owners_of(owners_table *owners, const std::map<uint8_t, group_view> &groups);
-// Of the groups whose address and members are known. None when the time is 0.
+// The protection of each group whose local address and owners are known. Empty when the time is 0.
 std::map<uint8_t, group_protection> find_protections(const owners_table &owners,
                                                      const std::map<uint8_t, group_view> &groups,
                                                      uint32_t protection_s);
 
-// Of a group that has an intercept, or whose table is known: why its flows are not protected, "" where they
-// are, and how many slots have packets passed on.
+// Whether the flows of a group are protected.
 struct group_cover {
-    std::string reason;
-    size_t slots = 0;
+    std::string reason; // why not, or ""
+    size_t slots = 0;   // whose packets are passed on
 };
-// `has_redirect_headers`: what routers have sent in GRE so far has come with one. Nothing for no group.
+// For groups that have an intercept, or whose owners are known. `has_redirect_headers`: the GRE packets of
+// the routers have redirect headers.
 std::map<uint8_t, group_cover> find_covers(const appliance_view &view, bool user_space, bool enabled,
                                            bool has_redirect_headers);

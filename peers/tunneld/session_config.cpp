@@ -1,5 +1,6 @@
-// mgmtd has checked what it keeps, but tunneld turns it into rules of the kernel: every value is checked
-// again and bounded. Each kind of node is a row with the function that takes its text.
+// Although mgmtd has checked the configuration, every value is checked and bounded again here, since it
+// becomes part of kernel rules. The nodes of an intercept are rows of a table with the function that reads
+// the text.
 #include "peers/tunneld/session_config.h"
 
 #include <algorithm>
@@ -118,7 +119,7 @@ constexpr word<bool> bools[] = {{"false", false}, {"true", true}};
 
 struct intercept_node {
     const char *name;
-    bool needed; // the intercept means something else without it
+    bool needed; // the intercept is left out without it
     bool (*take)(const std::string &text, intercept *out);
 };
 #define TAKE(call) [](const std::string &text, intercept *out) { return call; }
@@ -140,10 +141,10 @@ constexpr intercept_node intercept_nodes[] = {
 };
 #undef TAKE
 
-// What is read, with what is known of it so far.
+// The state of one reading of the configuration.
 struct reading {
     configured_view view;
-    std::map<uint8_t, std::map<std::string, bool>> taken; // of intercepts: nodes, and whether they were good
+    std::map<uint8_t, std::map<std::string, bool>> taken; // by intercept and node: whether the text was good
     std::vector<std::string> *complaints;
 
     void complain(const std::string &line) const {
@@ -173,7 +174,7 @@ void leave_out_unsound(reading *self) {
             if (const auto found = taken.find(node.name);
                 node.needed && (found == taken.end() || !found->second))
                 missing = missing.empty() ? node.name : missing;
-        const std::string &argument = rules.check.argument; // a blank would end the path of a page
+        const std::string &argument = rules.check.argument; // a blank would end the path in an HTTP request
         if (missing.empty() && rules.check.kind != check_kind::tcp &&
             (argument.empty() ||
              (rules.check.kind == check_kind::http && argument.find(' ') != std::string::npos)))
@@ -210,9 +211,9 @@ void read_drain(reading *self, uint8_t group, const std::string &leaf, const std
         self->view.drains[group] = text != "draining";
 }
 
-// --- By instance
+// --- Nodes by instance
 
-// The part of the name below `root`, and the one below that, or "".
+// The part of the name below `root`, and the part below that one, or "". False for names with more parts.
 bool split_name(const node_name &name, const node_name &root, std::string *out_instance,
                 std::string *out_leaf) {
     const size_t depth = root.parts.size();
@@ -232,7 +233,7 @@ void read_bypass(reading *self, const std::string &instance, const std::string &
         self->complain("bypass \"" + shown_text(instance) + "\" ignored");
         return;
     }
-    // The nodes of an instance follow one another.
+    // All nodes of an instance come one after the other.
     if (!entries.empty() && entries.back().prefix == entry.prefix)
         entries.back().until = leaf == "until" ? entry.until : entries.back().until;
     else if (entries.size() < BYPASSES_MAX)
@@ -258,7 +259,7 @@ void read_accepted(reading *self, const std::string &instance, const std::string
         self->complain("accepted sources after the first " + std::to_string(ACCEPTED_MAX) + " ignored");
 }
 
-// A node of the whole table of its own.
+// The node has no instance: its own name comes in place of one.
 void read_protection(reading *self, const std::string &leaf, const std::string &, const std::string &text) {
     if (leaf == "time" && !take_number(text, 0, 86400, &self->view.protection_s))
         self->complain("protection: time \"" + shown_text(text) + "\" ignored");
@@ -325,7 +326,7 @@ std::map<uint8_t, size_t> count_configured_routers(const std::vector<event_field
     return out;
 }
 
-// --- wccpd's state
+// --- State of wccpd
 
 std::map<uint8_t, std::string> read_group_owners(const std::vector<event_field> &nodes) {
     static const node_name root = parsed_name(NODE_GROUP_STATE);

@@ -1,7 +1,7 @@
-// The plane that carries nothing.
+// The data plane `table`, which carries nothing.
 #pragma once
 
 #include <cstdint>
 
-// Index of the next link, rising from there; 0xFFFFFFFF gives none to any.
+// The index of the next link, counting up; with 0xFFFFFFFF no link gets an index.
 extern uint32_t table_plane_next_index;

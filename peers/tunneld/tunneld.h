@@ -1,6 +1,7 @@
-// tunneld: composes its parts. Commands and roles come from the mailbox, the configuration from mgmtd, the
-// health of proxies from checks; what follows from these for the kernel is computed anew after each change,
-// and reconciled. One thread with a loop; the user-space data plane has one of its own.
+// The program, composed of its parts. Commands and roles come from the mailbox, the configuration from mgmtd,
+// the health of proxies from checks. After each change the wanted state of the kernel is computed from all of
+// these, and the kernel is reconciled with it. All of it runs in one thread with an event loop; the data
+// plane `user` has a second thread.
 #pragma once
 
 #include <cstdint>
@@ -21,92 +22,93 @@
 #include "peers/tunneld/wanted_state.h"
 
 constexpr int64_t TICK_MS = 1000;
-// How packets are sorted stays as a killed tunneld has left it until the configuration has been read and
-// wccpd has named a router; for the latter, so long at most.
+// The sorting rules that a killed tunneld has left stay until the configuration has been read and wccpd has
+// named a router. This is how long a router is waited for.
 constexpr int64_t TAKE_OVER_WAIT_MS = 10000;
-// Between looks whether somebody else has changed what is ours in the kernel.
+// How often the kernel is compared with the wanted state when nothing has changed here: others may have
+// changed it.
 constexpr int64_t VERIFY_MS = 30000;
 
-// After wccpd has deleted a tunnel, or has ended: routers need a moment to follow.
+// How long links stay after wccpd has deleted their tunnels or has ended: routers still send for a moment.
 constexpr int64_t LINGER_MS = 5000;
 
 struct tunneld_options {
     command_options commands;
-    std::string plane = "auto"; // or the name of one
+    std::string plane = "auto"; // or the name of a data plane
 };
 
 // An intercept whose proxy is down.
 struct outage {
     int64_t since_ms; // monotonic
-    bool left;        // the group has left its routers because of it
+    bool left;        // the group has left its routers for this reason
 };
 
 struct lingering_link {
     lingering_tunnel tunnel;
     int64_t until_ms;
 };
-// A group that is not followed by its configuration alone.
+// A group with an intercept or a drain: its slow start, its limit and the progress of its drain.
 struct followed_group {
     course memory;
     course_decision decided;
-    uint32_t flows = 0;
-    // Of what mgmtd has heard in this session.
-    uint32_t reported_percent = 0; // 0: nothing; a tunneld before may have reported another
+    uint32_t flows = 0; // of its proxy, by the last count
+    // Reported to mgmtd in this session. An earlier tunneld may have reported something else.
+    uint32_t reported_percent = 0; // 0: nothing yet
     bool reported_overload = false;
-    std::optional<std::pair<uint32_t, bool>> reported_progress; // flows left, and whether it is empty
+    std::optional<std::pair<uint32_t, bool>> reported_progress; // remaining flows, and whether it is empty
 };
 
 struct tunneld {
     tunneld_options options;
     command_desk desk;
     const data_plane *plane = nullptr;
-    std::string plane_reason; // why no plane before it in the table could be used
-    std::string lack;         // what the kernel lacks for sorting packets, or ""
+    std::string plane_reason; // why the planes before it in the table could not be used
+    std::string lack;         // what the sorting rules need and the kernel lacks, or ""
 
     lew *loop = nullptr;
     loop_event *mailbox_timer = nullptr, *wake_up_event = nullptr;
-    int wake_up = -1; // the socket, -1 for none
+    int wake_up = -1; // the socket at which wccpd wakes this process, or -1
     mgmt_link *management = nullptr;
     health_monitor *health = nullptr;
 
     configured_view configured;
-    int64_t configured_ms = -1; // when it was read first
-    bool takes_over = false;    // and sorts as the tunneld before did
+    int64_t configured_ms = -1; // when the configuration was read for the first time
+    bool takes_over = false;    // the sorting rules of an earlier tunneld are still in place
     int64_t tick_at_ms = 0, last_command_ms = 0, alive_at_ms = 0;
-    std::map<uint8_t, bool> forced_l2; // by command, which wins over the configuration
-    std::map<uint16_t, bool> roles;    // of the policy groups of groups with an intercept: ACTIVE
+    std::map<uint8_t, bool> forced_l2; // by group, from commands; overrides the configuration
+    std::map<uint16_t, bool> roles;    // by policy group, of groups with an intercept: whether it is ACTIVE
     std::map<uint8_t, outage> outages;
     std::vector<uint32_t> own_addresses;
     owners_table owners;
     std::map<uint8_t, followed_group> followed;
-    uint32_t reported_session = 0; // that `followed` speaks of
+    uint32_t reported_session = 0; // to which the `reported_` values of `followed` belong
     std::string uncounted;         // why flows could not be counted, or ""
 
-    int32_t roles_of_pid = 0;              // the wccpd whose roles of groups are known
-    int64_t active_ms = -1;                // when a group was ACTIVE last
-    std::vector<lingering_link> lingering; // of tunnels that have been deleted
-    int64_t end_at_ms = -1;                // the program has been told to end, and waits until then
+    int32_t roles_of_pid = 0;              // process id of the wccpd that has reported the groups' roles
+    int64_t active_ms = -1;                // the last time a group was ACTIVE
+    std::vector<lingering_link> lingering; // of deleted tunnels
+    int64_t end_at_ms = -1;                // after a signal: when the program ends
 
-    std::vector<wanted_link> links; // that are there, or were wanted last
+    std::vector<wanted_link> links; // as last wanted; before that, as found at the start
     std::optional<wanted_state> applied;
-    std::map<std::string, uint32_t> indices; // of the links
-    std::string failure;                     // of the last reconciling, or ""
-    int64_t again_at_ms = 0, retry_delay_ms = 0;
+    std::map<std::string, uint32_t> indices;     // of the links' interfaces, by name
+    std::string failure;                         // of the last reconciliation, or ""
+    int64_t again_at_ms = 0, retry_delay_ms = 0; // of the next reconciliation without a change
     occurrences occurred;
-    int64_t look_at_counters_ms = 0;
+    int64_t look_at_counters_ms = 0; // when the counters are read next
 };
 
-// Slow starts, drains and limits of all groups: to call once a second.
+// Updates the slow starts, drains and limits of all groups. To be called once a second.
 void follow_groups(tunneld *daemon);
-// Whether new flows of the group may go to its proxy: wccpd runs, a router assigns to this appliance, and no
-// role of a policy group is against it.
+// Whether new flows of the group may go to its proxy: wccpd runs, a router assigns packets to this appliance,
+// and the policy group, if there is one, has the role ACTIVE.
 bool is_active_group(const tunneld &daemon, uint8_t group);
 bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules);
-// Of each group whether its flows are protected.
+// Whether each group's flows are protected.
 std::map<uint8_t, group_cover> protection_cover(const tunneld &daemon, const plane_counters &plane);
-// The program, until a signal ends it. The exit code.
+// Runs the program until a signal ends it. Returns its exit code.
 int run_tunneld(const tunneld_options &options);
-// The state nodes, in the order of a walk.
+// The state nodes, in the order in which a walk lists them. Notes occurrences first.
 std::vector<state_node> tunneld_state(tunneld *daemon);
-// Looks at the counters, and at what lasts.
+// Reads the counters, and updates `occurred`.
 void note_occurrences(tunneld *daemon);
