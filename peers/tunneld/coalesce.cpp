@@ -8,7 +8,7 @@ namespace {
 const ip4_wire_header *ip_of(const uint8_t *packet) {
     return reinterpret_cast<const ip4_wire_header *>(packet);
 }
-// Of packets without IP options, as all are that are merged.
+// For packets without IP options. Others are not merged.
 const tcp_wire_header *tcp_of(const uint8_t *packet) {
     return reinterpret_cast<const tcp_wire_header *>(packet + sizeof(ip4_wire_header));
 }
@@ -16,7 +16,7 @@ const udp_wire_header *udp_of(const uint8_t *packet) {
     return reinterpret_cast<const udp_wire_header *>(packet + sizeof(ip4_wire_header));
 }
 
-// Whether addresses, ports and flags can be looked at: TCP or UDP, whole, without IP options.
+// Whether the packet is TCP or UDP with its complete header, without IP options and not a fragment.
 bool has_ports(const uint8_t *packet, size_t length) {
     const ip4_wire_header *ip = ip_of(packet);
     if (ip4_header_length(*ip) != sizeof *ip || (to_host(ip->fragment) & IP4_FRAGMENT))
@@ -25,8 +25,8 @@ bool has_ports(const uint8_t *packet, size_t length) {
            (ip->protocol == PROTOCOL_UDP && length >= sizeof *ip + sizeof(udp_wire_header));
 }
 
-// Bytes of both headers when the packet may be part of a merged one; 0 otherwise.
-size_t mergeable_headers(const coalescer *merger, const uint8_t *packet, size_t length) {
+// The length of both headers if the packet can be merged with others, otherwise 0.
+size_t find_mergeable_headers(const coalescer *merger, const uint8_t *packet, size_t length) {
     if (to_host(ip_of(packet)->fragment) & ~IP4_DONT_FRAGMENT)
         return 0;
     size_t headers = sizeof(ip4_wire_header);
@@ -42,7 +42,7 @@ size_t mergeable_headers(const coalescer *merger, const uint8_t *packet, size_t 
         if (tcp_header_length(*tcp) < sizeof *tcp || (tcp->flags & ~TCP_PSH) != TCP_ACK)
             return 0;
     }
-    // As the splitter and the kernel see it: no segment is smaller than that.
+    // The splitter, like the kernel, refuses smaller segments.
     return length >= headers + MIN_SEGMENT_SIZE ? headers : 0;
 }
 
@@ -52,7 +52,7 @@ bool transport_is_right(const uint8_t *packet, size_t length) {
                                           packet + sizeof(ip4_wire_header), transport));
 }
 
-size_t slot_of(const void *target, const uint8_t *packet) {
+size_t find_flow_slot(const void *target, const uint8_t *packet) {
     uint64_t addresses;
     memcpy(&addresses, &ip_of(packet)->source, sizeof addresses);
     uint32_t ports;
@@ -67,7 +67,7 @@ bool same_flow(const coalesced_flow &flow, const void *target, const uint8_t *pa
            memcmp(flow.first + sizeof(ip4_wire_header), packet + sizeof(ip4_wire_header), 4) == 0;
 }
 
-// What every header of a merged packet shares.
+// Whether the fields that all packets of a merged one have to share are the same.
 bool same_headers(const coalesced_flow &flow, const uint8_t *packet) {
     const ip4_wire_header *a = ip_of(flow.first), *b = ip_of(packet);
     if (a->tos != b->tos || a->ttl != b->ttl || !(a->fragment == b->fragment))
@@ -80,8 +80,8 @@ bool same_headers(const coalesced_flow &flow, const uint8_t *packet) {
            memcmp(s + 1, t + 1, tcp_header_length(*s) - sizeof *s) == 0;
 }
 
-// The kernel numbers the parts of what it splits one by one. Where the packet may not be fragmented the
-// number means nothing, and some senders keep the same.
+// When the kernel splits a packet, it numbers the ids of the segments consecutively. With DF the id has no
+// meaning, and some senders use the same one for all.
 bool id_follows(const coalesced_flow &flow, const uint8_t *packet) {
     const ip4_wire_header *ip = ip_of(packet);
     const uint16_t from_first = static_cast<uint16_t>(to_host(ip->id) - flow.first_id);
@@ -98,21 +98,21 @@ bool can_follow(coalesced_flow *flow, const uint8_t *packet, size_t length, size
         headers + flow->payload + payload > IP4_MAX_PACKET || !same_headers(*flow, packet) ||
         (tcp && to_host(tcp_of(packet)->sequence) != flow->next_sequence) || !id_follows(*flow, packet))
         return false;
-    // Merging makes new checksums, which would hide that these were wrong.
+    // The merged packet gets a new checksum, which would hide that an old one was wrong.
     if (!flow->verified && !transport_is_right(flow->first, flow->packet_length))
         return false;
     flow->verified = true;
     return transport_is_right(packet, length);
 }
 
-void write_alone(coalescer *merger, void *target, const uint8_t *packet, size_t length) {
+void write_unmerged(coalescer *merger, void *target, const uint8_t *packet, size_t length) {
     static const virtio_header plain = {};
     const iovec parts[2] = {{const_cast<virtio_header *>(&plain), sizeof plain},
                             {const_cast<uint8_t *>(packet), length}};
     merger->sink(target, parts, 2, 1);
 }
 
-// Headers for the whole, as the device wants them: with the checksum of the pseudo-header.
+// Writes the headers of the merged packet. The transport checksum is partial, as the TUN device expects it.
 void write_merged_headers(const coalesced_flow &flow, uint8_t *out) {
     memcpy(out, flow.first, flow.header_length);
     auto *ip = reinterpret_cast<ip4_wire_header *>(out);
@@ -136,7 +136,7 @@ void write_merged_headers(const coalesced_flow &flow, uint8_t *out) {
 void flush_flow(coalescer *merger, coalesced_flow *flow) {
     merger->used &= ~(uint64_t{1} << (flow - merger->flows));
     if (flow->count == 1)
-        return write_alone(merger, flow->target, flow->first, flow->packet_length);
+        return write_unmerged(merger, flow->target, flow->first, flow->packet_length);
     uint8_t headers[sizeof(ip4_wire_header) + TCP_MAX_HEADER];
     write_merged_headers(*flow, headers);
     const bool udp = ip_of(flow->first)->protocol == PROTOCOL_UDP;
@@ -152,7 +152,7 @@ void flush_flow(coalescer *merger, coalesced_flow *flow) {
     merger->sink(flow->target, flow->parts, 2 + flow->count, flow->count);
 }
 
-void append(coalesced_flow *flow, const uint8_t *packet, size_t length) {
+void append_segment(coalesced_flow *flow, const uint8_t *packet, size_t length) {
     const size_t payload = length - flow->header_length;
     if (flow->count == 1)
         flow->id_step = static_cast<uint16_t>(to_host(ip_of(packet)->id) - flow->first_id);
@@ -177,7 +177,7 @@ void begin_flow(coalescer *merger, coalesced_flow *flow, void *target, const uin
     flow->verified = flow->pushed = false;
     if (ip_of(packet)->protocol == PROTOCOL_TCP)
         flow->next_sequence = to_host(tcp_of(packet)->sequence);
-    append(flow, packet, length);
+    append_segment(flow, packet, length);
     merger->used |= uint64_t{1} << (flow - merger->flows);
 }
 
@@ -187,22 +187,22 @@ void coalesce_packet(coalescer *merger, void *target, const uint8_t *packet, siz
     if (!has_ports(packet, length)) {
         const uint8_t protocol = ip_of(packet)->protocol;
         if (protocol == PROTOCOL_TCP || protocol == PROTOCOL_UDP)
-            coalesce_flush(merger); // of whichever flow it is
-        return write_alone(merger, target, packet, length);
+            coalesce_flush(merger); // its flow is unknown, and the flow's earlier packets go first
+        return write_unmerged(merger, target, packet, length);
     }
-    coalesced_flow *flow = &merger->flows[slot_of(target, packet)];
+    coalesced_flow *flow = &merger->flows[find_flow_slot(target, packet)];
     const bool waiting = merger->used >> (flow - merger->flows) & 1;
-    const size_t headers = mergeable_headers(merger, packet, length);
+    const size_t headers = find_mergeable_headers(merger, packet, length);
     if (waiting && headers && same_flow(*flow, target, packet) && can_follow(flow, packet, length, headers)) {
-        append(flow, packet, length);
+        append_segment(flow, packet, length);
     } else {
         if (waiting)
             flush_flow(merger, flow);
         if (!headers)
-            return write_alone(merger, target, packet, length);
+            return write_unmerged(merger, target, packet, length);
         begin_flow(merger, flow, target, packet, length, headers);
     }
-    // Nothing may follow these.
+    // PSH and a shorter segment end a merged packet.
     if (flow->pushed || length - headers < flow->segment_size)
         flush_flow(merger, flow);
 }
@@ -248,8 +248,8 @@ bool complete_checksum(const virtio_header &header, uint8_t *packet, size_t leng
     const size_t at = size_t{header.checksum_start} + header.checksum_offset;
     if (header.checksum_start >= length || at + sizeof(be16) > length)
         return false;
-    // The field holds the pseudo-header's part, which is summed with the rest. UDP writes 0 as its
-    // complement.
+    // The field holds the sum of the pseudo-header, which is thus included. A result of 0 is sent as 0xffff,
+    // since 0 means "no checksum" in UDP.
     be16 sum =
         checksum_finish(checksum_add(0, packet + header.checksum_start, length - header.checksum_start));
     if (to_host(sum) == 0)

@@ -1,10 +1,11 @@
-// wccpd gives a command up after two seconds: an add is then withdrawn, a delete or an L2 return is
-// overwritten by the next command. Therefore a command is checked again after it has been read and once more
-// before it is answered. One that is gone by then gets no answer, since that would be taken for the answer to
-// another, and an add that is gone is undone, since nobody knows its tunnel.
+// wccpd gives a command up after two seconds: it then withdraws an add, and overwrites a delete or an L2
+// return with its next command. Therefore a command is read a second time, to see that it was not overwritten
+// meanwhile, and compared once more before it is answered. A command that is gone by then gets no answer,
+// which wccpd would take for the answer to the next one, and an add that is gone is undone, since wccpd does
+// not know that the tunnel exists.
 //
-// A tunnel's ends are its identity and its id a handle, as on wccpd's side: an add under another id, or under
-// an id whose delete was lost, replaces what was there.
+// As in wccpd, a tunnel is identified by its two ends, and its id is only a handle. An add of known ends
+// under another id, or of other ends under a known id (its delete was lost), replaces the old tunnel.
 #include "peers/tunneld/commands.h"
 
 #include <sys/socket.h>
@@ -26,7 +27,7 @@
 
 namespace {
 
-// True when a signal has cut the sleep short.
+// True when a signal has interrupted the sleep.
 bool sleep_or_end(int64_t ms) {
     const timespec time = {ms / 1000, (ms % 1000) * 1000000};
     return nanosleep(&time, nullptr) != 0 && errno == EINTR;
@@ -80,21 +81,22 @@ mailbox_command read_command(uint16_t code) {
     return command;
 }
 
-bool still_there(const mailbox_command &command) {
+// The code is read last once more: wccpd clears it before it writes the parameters of another command.
+bool is_still_pending(const mailbox_command &command) {
     return wccp_get_tunnel_command() == command.code && read_command(command.code) == command &&
            wccp_get_tunnel_command() == command.code;
 }
 
-// False when wccpd has given the command up: it gets no answer.
-bool answer(const mailbox_command &given, uint32_t index, uint32_t status) {
-    if (!still_there(given))
+// False when wccpd has given the command up. It is not answered then.
+bool answer_command(const mailbox_command &given, uint32_t index, uint32_t status) {
+    if (!is_still_pending(given))
         return false;
     if (given.code != MAILBOX_L2_RETURN)
         wccp_set_fmst_index(index);
     return wccp_set_tunnel_command_status(status);
 }
 
-uint32_t take_index(command_desk *desk) {
+uint32_t take_next_index(command_desk *desk) {
     const uint32_t index = desk->next_index;
     if (index != WCCP_NO_INDEX && ++desk->next_index == WCCP_NO_INDEX)
         desk->next_index = 1;
@@ -106,19 +108,20 @@ void apply_table(command_desk *desk) {
         desk->apply(&desk->tunnels);
 }
 
-// The index of the tunnel, an old one where its ends and its id are known; WCCP_NO_INDEX when there is none.
-uint32_t add(command_desk *desk, const mailbox_command &command) {
+// Returns the index of the tunnel, which is the old one if the tunnel exists; WCCP_NO_INDEX when it cannot be
+// made.
+uint32_t add_ordered_tunnel(command_desk *desk, const mailbox_command &command) {
     for (auto it = desk->tunnels.begin(); it != desk->tunnels.end();) {
         const bool same_id = it->first == command.tunnel_id;
         const bool same_ends = it->second.local == command.local && it->second.remote == command.remote;
-        const bool replaced = same_id != same_ends;
+        const bool replaced = same_id != same_ends; // both the same: it is this tunnel
         it = replaced ? desk->tunnels.erase(it) : std::next(it);
     }
     const command_tunnel wanted = {command.local, command.remote, WCCP_NO_INDEX};
     const auto [tunnel, is_new] = desk->tunnels.insert({command.tunnel_id, wanted});
-    apply_table(desk); // a tunnel that is known, too: its interface may have gone
+    apply_table(desk); // also for a known tunnel: somebody may have removed its interface
     if (!desk->apply && is_new)
-        tunnel->second.index = take_index(desk);
+        tunnel->second.index = take_next_index(desk);
     const uint32_t index = tunnel->second.index;
     if (index == WCCP_NO_INDEX) {
         desk->tunnels.erase(command.tunnel_id);
@@ -138,7 +141,7 @@ int32_t read_wccpd_pid() {
 }
 
 void write_wccpd_pid(int32_t pid) {
-    mkdir("/run/tunneld", 0755); // if it isn't there yet
+    mkdir("/run/tunneld", 0755); // fails when it exists
     FILE *file = fopen(WCCPD_FILE, "we");
     if (!file || fprintf(file, "%d\n", pid) < 0)
         LC_LOG(LC_LOG_WARNING, "Cannot write %s: %m", WCCPD_FILE);
@@ -146,9 +149,9 @@ void write_wccpd_pid(int32_t pid) {
         fclose(file);
 }
 
-// Carries the command out; the status that it is answered with.
-uint32_t carry_out(command_desk *desk, const mailbox_command &command, uint32_t *out_index,
-                   const char **out_result) {
+// Returns the status for the answer: 1 for a failure, otherwise 0.
+uint32_t execute_command(command_desk *desk, const mailbox_command &command, uint32_t *out_index,
+                         const char **out_result) {
     const auto found = desk->tunnels.find(command.tunnel_id);
     const bool known = found != desk->tunnels.end() && found->second.local == command.local &&
                        found->second.remote == command.remote;
@@ -159,7 +162,7 @@ uint32_t carry_out(command_desk *desk, const mailbox_command &command, uint32_t 
     *out_result = "done";
     switch (command.code) {
     case MAILBOX_ADD_TUNNEL:
-        *out_index = add(desk, command);
+        *out_index = add_ordered_tunnel(desk, command);
         desk->ordered.insert(command.tunnel_id);
         if (*out_index == WCCP_NO_INDEX)
             *out_result = "done, without an index";
@@ -197,7 +200,8 @@ void watch_wccpd(command_desk *desk, int64_t now_ms) {
         return;
     write_wccpd_pid(pid);
     desk->ordered.clear();
-    if (before == 0 || desk->tunnels.empty()) // or nobody knows: tunnels that may be in use stay
+    if (before == 0 ||
+        desk->tunnels.empty()) // 0: whether wccpd is new is unknown, and the tunnels may be in use
         return;
     LC_LOG(LC_LOG_NOTICE, "wccpd has been started anew: %zu tunnels wait to be ordered again",
            desk->tunnels.size());
@@ -250,7 +254,7 @@ bool take_command(command_desk *desk, bool *out_end) {
         return false;
     }
     mailbox_command command = read_command(code);
-    if (wccp_get_tunnel_command() != code)
+    if (wccp_get_tunnel_command() != code) // overwritten while it was read
         return true;
     if (desk->options.silent) {
         if (desk->passed_over != command)
@@ -262,9 +266,9 @@ bool take_command(command_desk *desk, bool *out_end) {
     const mailbox_command given = command;
     const auto before = desk->tunnels;
     const char *result;
-    const uint32_t status = carry_out(desk, command, &command.index, &result);
+    const uint32_t status = execute_command(desk, command, &command.index, &result);
     *out_end = desk->options.slow_ms && sleep_or_end(desk->options.slow_ms);
-    if (!answer(given, command.index, status)) {
+    if (!answer_command(given, command.index, status)) {
         if (code == MAILBOX_ADD_TUNNEL) {
             desk->tunnels = before;
             apply_table(desk);
@@ -288,7 +292,7 @@ int open_wake_up() {
     unlink(WCCP_WAKE_UP_PATH);
     if (fd >= 0 && bind(fd, reinterpret_cast<const sockaddr *>(&own), sizeof own) == 0)
         return fd;
-    LC_LOG(LC_LOG_WARNING, "%s: %m: commands are looked for instead", WCCP_WAKE_UP_PATH);
+    LC_LOG(LC_LOG_WARNING, "%s: %m: the mailbox is polled instead", WCCP_WAKE_UP_PATH);
     if (fd >= 0)
         close(fd);
     return -1;
@@ -320,5 +324,5 @@ bool start_commands(command_desk *desk, const command_options &options, FILE *ou
     desk->options = options;
     desk->out = out;
     desk->next_index = options.first_index;
-    return cmem_attach_registry(); // through which the mailbox is found once wccpd has created it
+    return cmem_attach_registry(); // the mailbox is found through it once wccpd has created it
 }

@@ -6,15 +6,17 @@ namespace {
 
 constexpr int64_t SECOND_LOOK_MS = 1000;
 
-// Between the two looks a connection that was being accepted has become one.
-bool is_empty(course *self, const course_facts &facts) {
+// Empty means no flow at two counts a second apart: a connection that was being accepted during the first
+// count is seen by the second.
+bool is_group_empty(course *self, const course_facts &facts) {
     if (!facts.draining) {
         self->draining_ms = self->empty_ms = -1;
         return false;
     }
     if (self->draining_ms < 0)
         self->draining_ms = facts.now_ms;
-    // Without other appliances the table stays as it is; with them it is seen to have changed.
+    // Before the routers have the table without this appliance, new flows still come. Without other
+    // appliances the table does not change.
     const bool moved =
         facts.left || facts.alone || !facts.active || facts.now_ms - self->draining_ms >= TABLE_CHANGE_MS;
     if (facts.flows > 0 || !moved)
@@ -30,9 +32,9 @@ bool is_overloaded(course *self, const course_facts &facts) {
     return self->overloaded;
 }
 
-// The first step is announced as long as there is no use for more, so that the routers have it from the
-// start. A group that is found at work is not slowed down.
-uint32_t find_weight(course *self, const course_facts &facts) {
+// While the group cannot serve flows, the first step is announced, so that the routers already have it when
+// the slow start begins. A group that is active when tunneld starts is not slowed down.
+uint32_t find_weight_percent(course *self, const course_facts &facts) {
     if (facts.active)
         self->inactive_ms = -1;
     else if (self->inactive_ms < 0)
@@ -62,8 +64,8 @@ uint32_t find_weight(course *self, const course_facts &facts) {
 
 course_decision follow_course(course *self, const course_facts &facts) {
     course_decision out;
-    out.weight_percent = find_weight(self, facts);
+    out.weight_percent = find_weight_percent(self, facts);
     out.overloaded = is_overloaded(self, facts);
-    out.empty = is_empty(self, facts);
+    out.empty = is_group_empty(self, facts);
     return out;
 }

@@ -31,28 +31,30 @@ struct descriptor {
     }
 };
 
-// False for IPv6 proper. A proxy that listens on both has its IPv4 connections in sockets of IPv6.
-bool read_address(uint8_t family, const __be32 (&words)[4], uint32_t *out) {
+// False for an IPv6 address. A proxy that listens on both has its IPv4 connections in IPv6 sockets, with
+// addresses below ::ffff:0:0/96.
+bool read_socket_address(uint8_t family, const __be32 (&words)[4], uint32_t *out) {
     if (family == AF_INET6 && (words[0] != 0 || words[1] != 0 || ntohl(words[2]) != 0xFFFF))
         return false;
     *out = ntohl(family == AF_INET6 ? words[3] : words[0]);
     return true;
 }
 
-void take_socket(const inet_diag_msg &socket, const std::vector<uint32_t> &own, std::vector<flow_ends> *out) {
+void add_flow_of_socket(const inet_diag_msg &socket, const std::vector<uint32_t> &own,
+                        std::vector<flow_ends> *out) {
     flow_ends flow{};
-    // Both directions are at an end for a socket of nobody that waits for the other side's FIN alone.
+    // A socket in FIN_WAIT2 that no process has (inode 0) only waits for the other side's FIN.
     if ((socket.idiag_state == TCP_FIN_WAIT2 && socket.idiag_inode == 0) || out->size() >= FLOWS_MAX ||
-        !read_address(socket.idiag_family, socket.id.idiag_src, &flow.local) ||
-        !read_address(socket.idiag_family, socket.id.idiag_dst, &flow.remote) || flow.local >> 24 == 127 ||
-        std::binary_search(own.begin(), own.end(), flow.local))
+        !read_socket_address(socket.idiag_family, socket.id.idiag_src, &flow.local) ||
+        !read_socket_address(socket.idiag_family, socket.id.idiag_dst, &flow.remote) ||
+        flow.local >> 24 == 127 || std::binary_search(own.begin(), own.end(), flow.local))
         return;
     flow.local_port = ntohs(socket.id.idiag_sport);
     flow.remote_port = ntohs(socket.id.idiag_dport);
     out->push_back(flow);
 }
 
-bool send_question(int fd, uint8_t family) {
+bool send_socket_query(int fd, uint8_t family) {
     struct {
         nlmsghdr header;
         inet_diag_req_v2 question;
@@ -66,8 +68,9 @@ bool send_question(int fd, uint8_t family) {
     return send(fd, &request, sizeof request, 0) == static_cast<ssize_t>(sizeof request);
 }
 
-// The kernel makes each part of the answer while it is read: there is nothing to wait for. 0, or an errno.
-int read_answer(int fd, const std::vector<uint32_t> &own, std::vector<flow_ends> *out) {
+// The kernel makes each part of the answer when it is read, therefore the reads need not block. Returns 0 or
+// an errno.
+int read_socket_list(int fd, const std::vector<uint32_t> &own, std::vector<flow_ends> *out) {
     const std::unique_ptr<char[]> bytes(new char[ANSWER_BYTES]);
     for (;;) {
         const ssize_t count = recv(fd, bytes.get(), ANSWER_BYTES, MSG_DONTWAIT);
@@ -85,7 +88,7 @@ int read_answer(int fd, const std::vector<uint32_t> &own, std::vector<flow_ends>
                            ? -static_cast<const nlmsgerr *>(NLMSG_DATA(message))->error
                            : EIO;
             if (message->nlmsg_len >= NLMSG_LENGTH(sizeof(inet_diag_msg)))
-                take_socket(*static_cast<const inet_diag_msg *>(NLMSG_DATA(message)), own, out);
+                add_flow_of_socket(*static_cast<const inet_diag_msg *>(NLMSG_DATA(message)), own, out);
         }
     }
 }
@@ -103,9 +106,9 @@ bool read_transparent_flows(const std::vector<uint32_t> &own_addresses, std::vec
     out->clear();
     for (const uint8_t family : {uint8_t{AF_INET}, uint8_t{AF_INET6}}) {
         const descriptor kernel(socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_SOCK_DIAG));
-        const int error = kernel.fd < 0 || !send_question(kernel.fd, family)
+        const int error = kernel.fd < 0 || !send_socket_query(kernel.fd, family)
                               ? errno
-                              : read_answer(kernel.fd, own_addresses, out);
+                              : read_socket_list(kernel.fd, own_addresses, out);
         if (error == 0 || (family == AF_INET6 && error == ENOENT)) // a kernel without IPv6
             continue;
         *out_error = std::string("sockets cannot be listed: ") + strerror(error);
@@ -114,8 +117,9 @@ bool read_transparent_flows(const std::vector<uint32_t> &own_addresses, std::vec
     return true;
 }
 
-// With a proxy that keeps the client's address, the connection to the server is transparent as well. Where
-// the intercept has its local port too, it is the same flow the other way round.
+// The connection of a proxy that keeps the client's address to the server is transparent as well. With an
+// intercept of all ports it would be counted as a second flow. Flows between the same two addresses are
+// therefore counted by direction, and the larger number of the two counts.
 std::map<uint8_t, uint32_t> count_flows(const std::vector<flow_ends> &flows,
                                         const std::map<uint8_t, intercept> &intercepts) {
     std::map<uint8_t, uint32_t> out;

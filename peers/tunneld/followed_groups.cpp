@@ -1,5 +1,5 @@
-// The course of each group that has an intercept or is being drained: the facts once a second, and mgmtd gets
-// what follows from them. A new session of mgmtd gets all of it.
+// Once a second, for each group that has an intercept or is being drained: collects the facts for course.h
+// and reports the decisions that have changed to mgmtd. A new session with mgmtd gets all of them.
 #include <algorithm>
 
 #include "peers/tunneld/flow_count.h"
@@ -15,7 +15,8 @@ bool needs_flows(const tunneld &daemon) {
                        [](const auto &each) { return each.second.limit > 0; });
 }
 
-// A count that fails leaves the last one, of a drain at least one flow: nothing is empty that isn't known.
+// If the count fails, the last one stays, but at least one flow is assumed: an unknown number must not end a
+// drain.
 void count_all_flows(tunneld *daemon) {
     std::vector<flow_ends> flows;
     std::string error;
@@ -30,7 +31,7 @@ void count_all_flows(tunneld *daemon) {
     }
 }
 
-course_facts find_facts(const tunneld &daemon, uint8_t id, const group_view &view, int64_t now) {
+course_facts collect_facts(const tunneld &daemon, uint8_t id, const group_view &view, int64_t now) {
     course_facts facts{};
     facts.now_ms = now;
     const auto drain = daemon.configured.drains.find(id);
@@ -60,7 +61,7 @@ void report_overload(tunneld *daemon, uint8_t id, followed_group *group, uint32_
     mgmt_link_overload(daemon->management, id, group->decided.overloaded, text);
 }
 
-void report(tunneld *daemon, uint8_t id, followed_group *group) {
+void report_decisions(tunneld *daemon, uint8_t id, followed_group *group) {
     const course_decision &decided = group->decided;
     if (decided.weight_percent != group->reported_percent) {
         group->reported_percent = decided.weight_percent;
@@ -78,8 +79,8 @@ void report(tunneld *daemon, uint8_t id, followed_group *group) {
     }
 }
 
-// Groups that come and go. What mgmtd has of one that goes ends with it.
-void choose_groups(tunneld *daemon) {
+// Adds and drops groups as the configuration changes. What was reported of a dropped group is taken back.
+void update_followed_groups(tunneld *daemon) {
     const configured_view &view = daemon->configured;
     for (auto at = daemon->followed.begin(); at != daemon->followed.end();) {
         auto &[id, group] = *at;
@@ -88,7 +89,7 @@ void choose_groups(tunneld *daemon) {
             continue;
         }
         group.decided = {};
-        report(daemon, id, &group);
+        report_decisions(daemon, id, &group);
         at = daemon->followed.erase(at);
     }
     for (const auto &[id, group] : view.groups)
@@ -99,7 +100,7 @@ void choose_groups(tunneld *daemon) {
 } // namespace
 
 void follow_groups(tunneld *daemon) {
-    // A tunneld that takes over doesn't know yet whether a group is at work.
+    // While an earlier tunneld's rules are in place, it isn't known yet whether a group is active.
     if (!daemon->management || daemon->configured_ms < 0 || daemon->takes_over)
         return;
     if (const uint32_t session = mgmt_link_session(daemon->management); session != daemon->reported_session) {
@@ -110,13 +111,13 @@ void follow_groups(tunneld *daemon) {
             group.reported_progress.reset();
         }
     }
-    choose_groups(daemon);
+    update_followed_groups(daemon);
     if (needs_flows(*daemon))
         count_all_flows(daemon);
     const int64_t now = lt_monotonic_ms();
     for (auto &[id, group] : daemon->followed) {
-        const course_facts facts = find_facts(*daemon, id, daemon->configured.groups.at(id), now);
+        const course_facts facts = collect_facts(*daemon, id, daemon->configured.groups.at(id), now);
         group.decided = follow_course(&group.memory, facts);
-        report(daemon, id, &group);
+        report_decisions(daemon, id, &group);
     }
 }

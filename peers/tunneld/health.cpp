@@ -1,9 +1,10 @@
-// One check at a time for each group: a connection or a process, with a time limit. The loop comes back for
-// whatever happens next, and the group's timer is either that limit or the wait for the next check.
+// Each group has one check at a time, a connection or a process. The group's timer is the time limit while a
+// check runs, and otherwise the wait for the next one.
 //
-// A command runs in a process group of its own. It is killed whole when its time is over, and what it has
-// left running is killed at its end, while its number still belongs to it. Whoever has been killed and does
-// not end (a file system that hangs) is kept aside until it does.
+// A command runs in a process group of its own, all of which is killed when the time limit is over. When the
+// command ends, the rest of its group is killed before the command is reaped: until then its number cannot
+// belong to another group. A killed process that does not end, for example on a file system that hangs, stays
+// in `commands` until it does.
 #include "peers/tunneld/health.h"
 
 #include <algorithm>
@@ -34,7 +35,7 @@ namespace {
 constexpr int64_t CHECK_MAX_MS = 10000;
 constexpr int64_t KILL_MAX_MS = 1000;
 constexpr int64_t STAGGER_MS = 2;         // between the first checks of many new ones
-constexpr size_t ANSWER_MAX_BYTES = 4096; // of which the first line counts
+constexpr size_t ANSWER_MAX_BYTES = 4096; // read at most to find the first line
 constexpr size_t LINGERING_MAX = 64;      // killed commands that have not ended
 constexpr char COMMAND_PATH[] = "PATH=/usr/sbin:/usr/bin:/sbin:/bin";
 
@@ -45,17 +46,17 @@ struct running_command {
     loop_event *end = nullptr;
 };
 
-struct watched {
+struct watched_proxy {
     health_monitor *owner = nullptr;
     uint8_t group = 0;
     health_check check;
     uint16_t port = 0;
-    bool settled = false; // by a result of this check
-    uint32_t row = 0;     // results that contradict the state, one after the other
+    bool settled = false; // this check has had a result
+    uint32_t row = 0;     // consecutive results that contradict the state
     loop_event *timer = nullptr, *socket = nullptr;
     int fd = -1;
     std::string unsent, answer;
-    running_command *command = nullptr; // of the owner's list
+    running_command *command = nullptr; // in the owner's list
     enum { waiting, checking } phase = waiting;
 };
 } // namespace
@@ -63,29 +64,29 @@ struct watched {
 struct health_monitor {
     loop_context *loop = nullptr;
     std::function<void(uint8_t group)> changed;
-    std::map<uint8_t, std::unique_ptr<watched>> checks;
+    std::map<uint8_t, std::unique_ptr<watched_proxy>> checks;
     std::map<uint8_t, proxy_health> states;
-    std::list<running_command> commands; // that run, also those that no check waits for any more
+    std::list<running_command> commands; // all that run, also killed ones that no check waits for
     std::minstd_rand random{static_cast<uint32_t>(lt_monotonic_ms())};
 };
 
 namespace {
 // --- Results
 
-int64_t next_wait_ms(watched *self) {
+int64_t next_wait_ms(watched_proxy *self) {
     const auto interval = static_cast<int64_t>(self->check.interval_s) * 1000;
     std::uniform_int_distribution<int64_t> spread(-interval / 20, interval / 20);
     return interval + spread(self->owner->random);
 }
 
-int64_t time_limit_ms(const watched *self) {
+int64_t time_limit_ms(const watched_proxy *self) {
     return std::min(static_cast<int64_t>(self->check.interval_s) * 1000, CHECK_MAX_MS);
 }
 
-void take_end(int fd, short flags, void *data);
+void take_command_end(int fd, short flags, void *data);
 
-// The connection is reset: a check leaves nothing in the proxy and no port in TIME_WAIT here.
-void close_socket(watched *self) {
+// Resets the connection: it leaves neither a half-open connection in the proxy nor a port in TIME_WAIT here.
+void close_check_socket(watched_proxy *self) {
     loop_event_free(&self->socket);
     if (self->fd < 0)
         return;
@@ -95,22 +96,22 @@ void close_socket(watched *self) {
     self->fd = -1;
 }
 
-void stop_check(watched *self) {
-    close_socket(self);
+void stop_check(watched_proxy *self) {
+    close_check_socket(self);
     self->unsent.clear();
     self->answer.clear();
-    if (self->command) // its end is taken in when it comes
+    if (self->command) // it is reaped by take_command_end()
         kill(-self->command->pid, SIGKILL);
     self->command = nullptr;
 }
 
-// `failure` is "" for a good one.
-void finish_check(watched *self, const std::string &failure) {
+// `failure` is "" for a successful check.
+void finish_check(watched_proxy *self, const std::string &failure) {
     health_monitor *monitor = self->owner;
     stop_check(self);
-    self->phase = watched::waiting;
+    self->phase = watched_proxy::waiting;
     if (loop_event_set_timer(self->timer, next_wait_ms(self)) != LC_OK)
-        LC_LOG(LC_LOG_ERR, "the proxy of group %d is not checked any more", self->group);
+        LC_LOG(LC_LOG_ERR, "The proxy of group %d is no longer checked: no timer", self->group);
     proxy_health &health = monitor->states[self->group];
     const bool good = failure.empty();
     health.checks++;
@@ -127,10 +128,10 @@ void finish_check(watched *self, const std::string &failure) {
     self->row = 0;
     health.state = wanted;
     health.since_ms = lt_monotonic_ms();
-    monitor->changed(self->group); // may set other checks: nothing of this one is used afterwards
+    monitor->changed(self->group); // may replace this check: `self` is not used after it
 }
 
-std::string words_of(int error) {
+std::string describe_socket_error(int error) {
     switch (error) {
     case ECONNREFUSED:
         return "connection refused";
@@ -144,7 +145,7 @@ std::string words_of(int error) {
 
 // --- Connections
 
-void judge_answer(watched *self, bool ended) {
+void judge_answer(watched_proxy *self, bool ended) {
     const size_t line = self->answer.find('\n');
     if (line == std::string::npos && !ended && self->answer.size() < ANSWER_MAX_BYTES)
         return;
@@ -159,23 +160,23 @@ void judge_answer(watched *self, bool ended) {
         finish_check(self, "");
 }
 
-void read_answer(watched *self) {
+void read_http_answer(watched_proxy *self) {
     char bytes[1024];
     const ssize_t count = recv(self->fd, bytes, sizeof bytes, 0);
     if (count < 0 && (errno == EAGAIN || errno == EINTR))
         return;
     if (count < 0) {
-        finish_check(self, words_of(errno));
+        finish_check(self, describe_socket_error(errno));
         return;
     }
     self->answer.append(bytes, static_cast<size_t>(count));
     judge_answer(self, count == 0);
 }
 
-void send_question(watched *self) {
+void send_http_request(watched_proxy *self) {
     const ssize_t count = send(self->fd, self->unsent.data(), self->unsent.size(), MSG_NOSIGNAL);
     if (count < 0 && errno != EAGAIN && errno != EINTR) {
-        finish_check(self, words_of(errno));
+        finish_check(self, describe_socket_error(errno));
         return;
     }
     self->unsent.erase(0, static_cast<size_t>(std::max<ssize_t>(count, 0)));
@@ -183,22 +184,22 @@ void send_question(watched *self) {
         finish_check(self, "no room for a check");
 }
 
-void take_socket(int, short flags, void *data) {
-    auto *self = static_cast<watched *>(data);
+void take_socket_event(int, short flags, void *data) {
+    auto *self = static_cast<watched_proxy *>(data);
     int error = 0;
     socklen_t length = sizeof error;
     (void)getsockopt(self->fd, SOL_SOCKET, SO_ERROR, &error, &length);
     if (error)
-        finish_check(self, words_of(error));
+        finish_check(self, describe_socket_error(error));
     else if (self->check.kind == check_kind::tcp)
         finish_check(self, "");
     else if (flags & LOOP_WRITE && !self->unsent.empty())
-        send_question(self);
+        send_http_request(self);
     else
-        read_answer(self);
+        read_http_answer(self);
 }
 
-std::string begin_connection(watched *self) {
+std::string begin_connection(watched_proxy *self) {
     sockaddr_in address{};
     address.sin_family = AF_INET;
     address.sin_port = htons(self->port);
@@ -208,12 +209,12 @@ std::string begin_connection(watched *self) {
         return std::string("no socket: ") + strerror(errno);
     if (connect(self->fd, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0 &&
         errno != EINPROGRESS)
-        return words_of(errno);
+        return describe_socket_error(errno);
     if (self->check.kind == check_kind::http)
         self->unsent = "GET " + self->check.argument +
                        " HTTP/1.0\r\nHost: 127.0.0.1:" + std::to_string(self->port) +
                        "\r\nUser-Agent: tunneld\r\nConnection: close\r\n\r\n";
-    if (loop_event_new(self->owner->loop, take_socket, self, &self->socket) != LC_OK ||
+    if (loop_event_new(self->owner->loop, take_socket_event, self, &self->socket) != LC_OK ||
         loop_event_set_fd(self->socket, self->fd, LOOP_WRITE) != LC_OK)
         return "no room for a check";
     return "";
@@ -221,7 +222,7 @@ std::string begin_connection(watched *self) {
 
 // --- Commands
 
-// With nothing of ours but the standard descriptors, which lead nowhere.
+// The command inherits nothing but standard descriptors, which are /dev/null.
 int spawn_command(const std::string &file, pid_t *out_pid) {
     posix_spawn_file_actions_t actions;
     posix_spawnattr_t attributes;
@@ -249,8 +250,7 @@ int spawn_command(const std::string &file, pid_t *out_pid) {
     return error;
 }
 
-// Takes in the end of a command that has been killed. One that doesn't end even so is left to whoever takes
-// in orphans.
+// Reaps a killed command if it ends before the deadline. Otherwise init reaps it after this program's end.
 void wait_for_killed(pid_t pid, int pidfd, int64_t deadline_ms) {
     pollfd end = {pidfd, POLLIN, 0};
     (void)poll(&end, 1, static_cast<int>(std::max<int64_t>(deadline_ms - lt_monotonic_ms(), 0)));
@@ -258,7 +258,7 @@ void wait_for_killed(pid_t pid, int pidfd, int64_t deadline_ms) {
     close(pidfd);
 }
 
-std::string begin_command(watched *self) {
+std::string begin_command(watched_proxy *self) {
     health_monitor *monitor = self->owner;
     if (monitor->commands.size() >= LINGERING_MAX + monitor->checks.size())
         return "too many earlier checks have not ended";
@@ -269,7 +269,8 @@ std::string begin_command(watched *self) {
     command.owner = monitor;
     command.pid = pid;
     command.pidfd = pidfd_open(pid, 0);
-    if (command.pidfd < 0 || loop_event_new(monitor->loop, take_end, &command, &command.end) != LC_OK ||
+    if (command.pidfd < 0 ||
+        loop_event_new(monitor->loop, take_command_end, &command, &command.end) != LC_OK ||
         loop_event_set_fd(command.end, command.pidfd, LOOP_READ) != LC_OK) {
         loop_event_free(&command.end);
         kill(-pid, SIGKILL);
@@ -281,21 +282,22 @@ std::string begin_command(watched *self) {
     return "";
 }
 
-std::string end_of(const siginfo_t &info) {
+// "" for success.
+std::string describe_exit(const siginfo_t &info) {
     if (info.si_code != CLD_EXITED)
         return std::string("ended by ") + lc_signal_num_to_name(info.si_status);
     return info.si_status ? "exit status " + std::to_string(info.si_status) : "";
 }
 
-void take_end(int, short, void *data) {
+void take_command_end(int, short, void *data) {
     auto *command = static_cast<running_command *>(data);
     health_monitor *monitor = command->owner;
-    kill(-command->pid, SIGKILL); // what it has left; its number is its own until the next line
+    kill(-command->pid, SIGKILL); // processes that it has left; the number is reserved until waitid()
     siginfo_t info = {};
     const bool known = waitid(P_PIDFD, static_cast<id_t>(command->pidfd), &info, WEXITED | WNOHANG) == 0;
     if (known && info.si_pid == 0)
-        return; // not yet
-    watched *check = nullptr;
+        return; // it has not ended yet
+    watched_proxy *check = nullptr;
     for (const auto &[group, each] : monitor->checks)
         if (each->command == command)
             check = each.get();
@@ -305,13 +307,13 @@ void take_end(int, short, void *data) {
     if (!check)
         return;
     check->command = nullptr;
-    finish_check(check, known ? end_of(info) : "its end was lost");
+    finish_check(check, known ? describe_exit(info) : "its exit status was lost");
 }
 
 // --- Checks
 
-void begin_check(watched *self) {
-    self->phase = watched::checking;
+void begin_check(watched_proxy *self) {
+    self->phase = watched_proxy::checking;
     const std::string failure =
         self->check.kind == check_kind::command ? begin_command(self) : begin_connection(self);
     if (!failure.empty())
@@ -320,37 +322,37 @@ void begin_check(watched *self) {
         finish_check(self, "no room for a check");
 }
 
-void take_timer(int, short, void *data) {
-    auto *self = static_cast<watched *>(data);
-    if (self->phase == watched::waiting)
+void take_check_timer(int, short, void *data) {
+    auto *self = static_cast<watched_proxy *>(data);
+    if (self->phase == watched_proxy::waiting)
         begin_check(self);
     else
         finish_check(self, "no answer in " + std::to_string(time_limit_ms(self)) + " ms");
 }
 
-void end_watching(watched *self) {
+void end_watching(watched_proxy *self) {
     stop_check(self);
     loop_event_free(&self->timer);
 }
 
-bool is_same_check(const watched *self, const intercept &rules) {
+bool is_same_check(const watched_proxy *self, const intercept &rules) {
     return self->check == rules.check && self->port == rules.to;
 }
 
-// The state that an earlier check has found holds until the first result of the new one.
+// Until the first result of a changed check, the state that the earlier check has found stays.
 void begin_watching(health_monitor *monitor, uint8_t group, const intercept &rules, int64_t delay_ms) {
-    std::unique_ptr<watched> &place = monitor->checks[group];
+    std::unique_ptr<watched_proxy> &place = monitor->checks[group];
     if (place)
         end_watching(place.get());
-    place = std::make_unique<watched>();
+    place = std::make_unique<watched_proxy>();
     place->owner = monitor;
     place->group = group;
     place->check = rules.check;
     place->port = rules.to;
     monitor->states.try_emplace(group);
-    if (loop_event_new(monitor->loop, take_timer, place.get(), &place->timer) != LC_OK ||
+    if (loop_event_new(monitor->loop, take_check_timer, place.get(), &place->timer) != LC_OK ||
         loop_event_set_timer(place->timer, delay_ms) != LC_OK)
-        LC_LOG(LC_LOG_ERR, "the proxy of group %d cannot be checked", group);
+        LC_LOG(LC_LOG_ERR, "The proxy of group %d cannot be checked: no timer", group);
 }
 } // namespace
 

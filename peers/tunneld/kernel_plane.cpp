@@ -1,4 +1,4 @@
-// The kernel's own GRE links, one for each tunnel.
+// The data plane `kernel`: a GRE link of the kernel for each tunnel.
 
 #include <net/if.h>
 
@@ -12,35 +12,36 @@
 
 namespace {
 
-// Ends of documentation: no other link has them.
+// Addresses reserved for documentation: no other link has them.
 constexpr char PROBE_NAME[] = "wccp-probe";
 constexpr uint32_t PROBE_LOCAL = 0xC0000201, PROBE_REMOTE = 0xC0000202;
 
-bool remove_by_name(const std::string &name, int *out_error) {
+bool remove_link_by_name(const std::string &name, int *out_error) {
     const unsigned index = if_nametoindex(name.c_str());
     *out_error = index ? remove_link(static_cast<int>(index)) : 0;
     return *out_error == 0;
 }
 
-// Making one loads the module where it isn't loaded yet.
-bool probe(std::string *out_why_not) {
+// Making a link also loads the module ip_gre where it isn't loaded yet.
+bool probe_kernel_gre(std::string *out_why_not) {
     int error = make_gre_link(PROBE_NAME, PROBE_LOCAL, PROBE_REMOTE);
-    if (error && error != EEXIST) { // a probe that was killed has left it
+    if (error && error != EEXIST) { // left by a tunneld that was killed during its probe
         *out_why_not = std::string("the kernel cannot make GRE links: ") + strerror(error);
         return false;
     }
-    if (!remove_by_name(PROBE_NAME, &error)) {
+    if (!remove_link_by_name(PROBE_NAME, &error)) {
         *out_why_not = std::string("cannot remove the GRE link ") + PROBE_NAME + ": " + strerror(error);
         return false;
     }
     return true;
 }
 
-bool open_plane(std::string *) {
+bool open_kernel_plane(std::string *) {
     return true;
 }
 
-bool take_over(const std::string &name, const gre_ends &wanted) {
+// Whether a GRE link of this name has the wanted ends and options. One that differs is removed.
+bool take_over_gre_link(const std::string &name, const gre_ends &wanted) {
     std::vector<found_link> links;
     int error = find_links(false, &links);
     const auto link =
@@ -53,9 +54,10 @@ bool take_over(const std::string &name, const gre_ends &wanted) {
     return false;
 }
 
-bool make_link(const std::string &name, const link_wish &wish, uint32_t *out_index, std::string *out_error) {
+bool make_kernel_link(const std::string &name, const link_wish &wish, uint32_t *out_index,
+                      std::string *out_error) {
     int error = make_gre_link(name, wish.local, wish.remote);
-    if (error == EEXIST && take_over(name, wanted_gre(wish.local, wish.remote)))
+    if (error == EEXIST && take_over_gre_link(name, wanted_gre(wish.local, wish.remote)))
         error = 0;
     else if (error == EEXIST)
         error = make_gre_link(name, wish.local, wish.remote);
@@ -68,14 +70,14 @@ bool make_link(const std::string &name, const link_wish &wish, uint32_t *out_ind
     return !error;
 }
 
-bool drop_link(const std::string &name, std::string *out_error) {
+bool drop_kernel_link(const std::string &name, std::string *out_error) {
     int error;
-    if (!remove_by_name(name, &error))
+    if (!remove_link_by_name(name, &error))
         *out_error = "cannot remove link " + name + ": " + strerror(error);
     return !error;
 }
 
-void read_counters(plane_counters *inout) {
+void read_kernel_counters(plane_counters *inout) {
     std::vector<found_link> links;
     if (find_links(true, &links))
         return;
@@ -83,12 +85,13 @@ void read_counters(plane_counters *inout) {
         if (link.kind != "gre" || !link_number(link.name))
             continue;
         link_counters &counters = inout->links[link.name];
-        link.counters.fragments = counters.fragments; // counted by the sorting rules: here packets are whole
+        // Fragments are counted by the sorting rules: the link gets whole packets.
+        link.counters.fragments = counters.fragments;
         counters = link.counters;
     }
 }
 
 } // namespace
 
-const data_plane kernel_plane = {"kernel",  probe,     open_plane,    [] {},
-                                 make_link, drop_link, read_counters, nullptr};
+const data_plane kernel_plane = {"kernel",         probe_kernel_gre, open_kernel_plane,    [] {},
+                                 make_kernel_link, drop_kernel_link, read_kernel_counters, nullptr};

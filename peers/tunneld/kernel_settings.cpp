@@ -38,7 +38,7 @@ struct descriptor {
 struct changed_setting {
     std::string before, now;
 };
-// By path. Read from the file by the first look, and written before a setting is changed.
+// By path. Read from the state file when first needed, and written to it before a setting is changed.
 using changed_settings = std::map<std::string, changed_setting>;
 std::optional<changed_settings> changed;
 bool unsaved;
@@ -66,7 +66,8 @@ bool is_value(const std::string &text) {
            std::all_of(text.begin(), text.end(), [](char c) { return c >= '0' && c <= '9'; });
 }
 
-void fail(const std::string &text, std::string *out_error) {
+// Keeps the first error.
+void note_error(const std::string &text, std::string *out_error) {
     if (out_error->empty())
         *out_error = text + ": " + strerror(errno);
 }
@@ -100,7 +101,7 @@ bool write_file(const std::string &path, int flags, const std::string &text) {
     return written == static_cast<ssize_t>(text.size());
 }
 
-// Nothing when there is no such setting or it is no small number.
+// Nothing when there is no such setting, or its value is not a number of at most three digits.
 std::optional<std::string> read_setting(const std::string &path) {
     auto text = read_file(CONF_DIRECTORY + path, 64);
     if (!text)
@@ -113,8 +114,8 @@ std::optional<std::string> read_setting(const std::string &path) {
     return std::nullopt;
 }
 
-// Lines that aren't ours are passed over.
-changed_settings parse_state(const std::string &text) {
+// Lines that tunneld does not write are ignored.
+changed_settings parse_changed_settings(const std::string &text) {
     changed_settings settings;
     size_t start = 0;
     for (size_t end; (end = text.find('\n', start)) != std::string::npos; start = end + 1) {
@@ -127,16 +128,16 @@ changed_settings parse_state(const std::string &text) {
     return settings;
 }
 
-void load_state(std::string *out_error) {
+void load_changed_settings(std::string *out_error) {
     if (changed)
         return;
     const auto text = read_file(STATE_FILE, STATE_BYTES);
     if (!text && errno != ENOENT)
-        fail(std::string("cannot read ") + STATE_FILE, out_error);
-    changed = text ? parse_state(*text) : changed_settings{};
+        note_error(std::string("cannot read ") + STATE_FILE, out_error);
+    changed = text ? parse_changed_settings(*text) : changed_settings{};
 }
 
-void save_state(std::string *out_error) {
+void save_changed_settings(std::string *out_error) {
     if (!unsaved)
         return;
     std::string text = std::string(STATE_HEADING) + "\n";
@@ -150,14 +151,14 @@ void save_state(std::string *out_error) {
                 write_file(NEW_STATE_FILE, O_CREAT | O_TRUNC, text) &&
                 rename(NEW_STATE_FILE, STATE_FILE) == 0;
     if (!saved)
-        fail(std::string("cannot write ") + STATE_FILE, out_error);
+        note_error(std::string("cannot write ") + STATE_FILE, out_error);
     unsaved = !saved;
 }
 
 bool write_setting(const std::string &path, const std::string &value, std::string *out_error) {
     if (write_file(CONF_DIRECTORY + path, 0, value))
         return true;
-    fail("cannot set " + (CONF_DIRECTORY + path) + " to " + value, out_error);
+    note_error("cannot set " + (CONF_DIRECTORY + path) + " to " + value, out_error);
     return false;
 }
 
@@ -170,8 +171,9 @@ std::vector<std::string> configured_interfaces() {
     return names;
 }
 
-// The setting by its path, unless it is left alone.
-const wanted_setting *find_wanted(const std::vector<wanted_setting> &wanted, const std::string &path) {
+// Null when the setting is not among the wanted ones.
+const wanted_setting *find_wanted_setting(const std::vector<wanted_setting> &wanted,
+                                          const std::string &path) {
     const auto found = std::find_if(wanted.begin(), wanted.end(),
                                     [&](const wanted_setting &setting) { return setting.path == path; });
     return found == wanted.end() ? nullptr : &*found;
@@ -182,33 +184,34 @@ void note_change(const std::string &path, const std::string &before, const std::
         unsaved = true;
 }
 
-// All interfaces that are not mentioned in `wanted` themselves get what `all` had, if they have less.
+// `before`: the old value of `all`, which interfaces get that have less, unless `wanted` has their own
+// setting.
 void note_raised(const std::vector<wanted_setting> &wanted, const std::string &key,
                  const std::string &before) {
     for (const auto &interface : configured_interfaces()) {
         const std::string path = interface + "/" + key;
-        const auto own = find_wanted(wanted, path) ? std::nullopt : read_setting(path);
+        const auto own = find_wanted_setting(wanted, path) ? std::nullopt : read_setting(path);
         if (own && std::stoi(*own) < std::stoi(before))
             note_change(path, *own, before);
     }
 }
 
-// Whether the setting was raised on behalf of one of `all` that is wanted.
+// Whether the setting was raised because one of `all` that is still wanted was lowered.
 bool is_raised(const std::vector<wanted_setting> &wanted, const std::string &path) {
     const auto parts = split_path(path);
-    return parts && !find_wanted(wanted, path) && find_wanted(wanted, "all/" + parts->key);
+    return parts && !find_wanted_setting(wanted, path) && find_wanted_setting(wanted, "all/" + parts->key);
 }
 
 } // namespace
 
 bool apply_settings(const std::vector<wanted_setting> &wanted, std::string *out_error) {
     std::string error;
-    load_state(&error);
+    load_changed_settings(&error);
     std::vector<const wanted_setting *> differing;
     for (const auto &setting : wanted) {
         const auto now = read_setting(setting.path);
         if (!now)
-            fail("cannot read " + (CONF_DIRECTORY + setting.path), &error);
+            note_error("cannot read " + (CONF_DIRECTORY + setting.path), &error);
         if (!now || *now == setting.value)
             continue;
         differing.push_back(&setting);
@@ -219,7 +222,7 @@ bool apply_settings(const std::vector<wanted_setting> &wanted, std::string *out_
         if (is_first && setting.path.starts_with("all/"))
             note_raised(wanted, setting.path.substr(4), *now);
     }
-    save_state(&error);
+    save_changed_settings(&error);
     for (const auto &[path, setting] : *changed)
         if (is_raised(wanted, path) && read_setting(path) == setting.before)
             write_setting(path, setting.now, &error);
@@ -232,12 +235,12 @@ bool apply_settings(const std::vector<wanted_setting> &wanted, std::string *out_
 
 bool restore_settings(const std::vector<wanted_setting> &wanted, std::string *out_error) {
     std::string error;
-    load_state(&error);
+    load_changed_settings(&error);
     std::vector<std::string> paths;
     for (const auto &[path, setting] : *changed)
-        if (!find_wanted(wanted, path) && !is_raised(wanted, path))
+        if (!find_wanted_setting(wanted, path) && !is_raised(wanted, path))
             paths.push_back(path);
-    // First what counts for all: no interface is without its protection meanwhile.
+    // `all` first: otherwise an interface would be unprotected for a moment.
     std::stable_partition(paths.begin(), paths.end(),
                           [](const std::string &path) { return path.starts_with("all/"); });
     for (const auto &path : paths) {
@@ -247,7 +250,7 @@ bool restore_settings(const std::vector<wanted_setting> &wanted, std::string *ou
         changed->erase(path);
         unsaved = true;
     }
-    save_state(&error);
+    save_changed_settings(&error);
     if (out_error->empty())
         *out_error = error;
     return error.empty();

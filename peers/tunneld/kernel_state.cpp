@@ -1,7 +1,7 @@
-// What is missing comes first: links, their settings, tables, rules, and then the rules that sort packets
-// into them. What is too much goes in the opposite order. Therefore a packet always finds what it is sent to,
-// and a program that is killed in between leaves nothing that swallows packets.
-
+// Missing objects are added first: links, their settings, tables, rules, and then the rules that sort packets
+// into them. Surplus objects are then removed in the opposite order. Therefore every rule leads to something
+// that exists at each moment, and a program that is killed in between leaves no rule or route that swallows
+// packets.
 #include "peers/tunneld/kernel_state.h"
 
 #include <net/if.h>
@@ -19,14 +19,14 @@
 
 namespace {
 
-// Links that the plane of this process has made or taken over, by name. The others are only in the kernel.
+// Links that this process's data plane has made or taken over, by name. Others exist only in the kernel.
 struct made_link {
     link_wish wish;
     uint32_t index;
 };
 std::map<std::string, made_link> made;
 
-// The first failure is the one to give.
+// Keeps the first failure, which is the one that is returned.
 struct failure {
     std::string text;
     void note(const std::string &error) {
@@ -48,7 +48,7 @@ bool same_ends(const link_wish &one, const link_wish &other) {
            (one.kind == link_kind::passing) == (other.kind == link_kind::passing);
 }
 
-const wanted_link *find_wanted(const wanted_state &wanted, const std::string &name) {
+const wanted_link *find_wanted_link(const wanted_state &wanted, const std::string &name) {
     const auto found = std::find_if(wanted.links.begin(), wanted.links.end(),
                                     [&](const wanted_link &link) { return link.name == name; });
     return found == wanted.links.end() ? nullptr : &*found;
@@ -64,11 +64,11 @@ bool drop_made_link(const data_plane &plane, const std::string &name, failure *f
     return true;
 }
 
-// A link that is not as it is wanted goes. False: what is in the kernel under this name stays.
-bool make_room(const data_plane &plane, const wanted_link &link, found_link *found, failure *failed) {
+// Removes the interface of this name if it is not the wanted link. False when it cannot be removed.
+bool remove_other_link(const data_plane &plane, const wanted_link &link, found_link *found, failure *failed) {
     const auto known = made.find(link.name);
     if (known != made.end() && known->second.index != static_cast<uint32_t>(found->index)) {
-        std::string error; // somebody else has removed the link: there is nothing to fail
+        std::string error; // ignored: somebody else has removed the interface already
         plane.drop_link(link.name, &error);
         made.erase(known);
     } else if (known != made.end() && !same_ends(known->second.wish, link.wish)) {
@@ -77,7 +77,7 @@ bool make_room(const data_plane &plane, const wanted_link &link, found_link *fou
         *found = {};
     }
     const char *kind = &plane == &kernel_plane ? "gre" : "tun";
-    if (found->index && found->kind != kind) { // of the other plane
+    if (found->index && found->kind != kind) { // left by a tunneld with the other data plane
         const int error = remove_link(found->index);
         failed->note("cannot remove link " + link.name, error);
         if (error)
@@ -87,9 +87,9 @@ bool make_room(const data_plane &plane, const wanted_link &link, found_link *fou
     return true;
 }
 
-// The link with its marks, but not yet up. False: there is none.
-bool make_link(const data_plane &plane, const wanted_link &link, found_link *found, failure *failed) {
-    if (&plane != &table_plane && !make_room(plane, link, found, failed))
+// Makes the link and marks it, but does not bring it up. False when there is no such link then.
+bool make_marked_link(const data_plane &plane, const wanted_link &link, found_link *found, failure *failed) {
+    if (&plane != &table_plane && !remove_other_link(plane, link, found, failed))
         return false;
     const auto known = made.find(link.name);
     if (known == made.end() || known->second.wish != link.wish) {
@@ -155,16 +155,16 @@ void remove_rules(const wanted_state &wanted, const std::vector<found_rule> &fou
             failed->note("cannot remove " + rule_text(one.rule), remove_rule(one.rule));
 }
 
-void drop_unwanted_made(const data_plane &plane, const wanted_state &wanted, failure *failed) {
+void drop_unwanted_made_links(const data_plane &plane, const wanted_state &wanted, failure *failed) {
     std::vector<std::string> names;
     for (const auto &[name, link] : made)
-        if (!find_wanted(wanted, name))
+        if (!find_wanted_link(wanted, name))
             names.push_back(name);
     for (const auto &name : names)
         drop_made_link(plane, name, failed);
 }
 
-// What is there of ours, besides what the process knows itself.
+// All of tunneld's links, routes and rules that are in the kernel.
 struct kernel_view {
     std::vector<found_link> links;
     std::vector<found_route> routes;
@@ -173,9 +173,9 @@ struct kernel_view {
 
 void remove_unwanted_links(const data_plane &plane, const wanted_state &wanted, const kernel_view &there,
                            failure *failed) {
-    drop_unwanted_made(plane, wanted, failed);
+    drop_unwanted_made_links(plane, wanted, failed);
     for (const auto &link : there.links)
-        if (!find_wanted(wanted, link.name) && !made.count(link.name))
+        if (!find_wanted_link(wanted, link.name) && !made.count(link.name))
             failed->note("cannot remove link " + link.name, remove_link(link.index));
 }
 
@@ -193,10 +193,10 @@ bool reconcile_table(const wanted_state &wanted, std::map<std::string, uint32_t>
                      failure *failed) {
     for (const auto &link : wanted.links) {
         found_link none;
-        if (make_link(table_plane, link, &none, failed))
+        if (make_marked_link(table_plane, link, &none, failed))
             (*out_indices)[link.name] = made.at(link.name).index;
     }
-    drop_unwanted_made(table_plane, wanted, failed);
+    drop_unwanted_made_links(table_plane, wanted, failed);
     return failed->text.empty();
 }
 
@@ -210,7 +210,7 @@ bool reconcile_links(const data_plane &plane, const wanted_state &wanted, kernel
     for (const auto &link : there->links)
         found[link.name] = link;
     for (const auto &link : wanted.links)
-        if (make_link(plane, link, &found[link.name], failed))
+        if (make_marked_link(plane, link, &found[link.name], failed))
             (*out_indices)[link.name] = static_cast<uint32_t>(found[link.name].index);
     std::string text;
     if (!apply_settings(wanted.settings, &text))
@@ -221,7 +221,7 @@ bool reconcile_links(const data_plane &plane, const wanted_state &wanted, kernel
     return true;
 }
 
-bool find_tables(kernel_view *there, failure *failed) {
+bool find_routes_and_rules(kernel_view *there, failure *failed) {
     const int routes = find_routes(&there->routes), rules = find_rules(&there->rules);
     failed->note("cannot list routes", routes);
     failed->note("cannot list rules", rules);
@@ -255,8 +255,8 @@ bool reconcile_kernel_state(const data_plane &plane, const wanted_state &wanted,
     kernel_view there;
     if (!reconcile_links(plane, wanted, &there, out_indices, &failed))
         return failed.give(out_error);
-    // Looked at after the links have changed: a link that is replaced takes its routes with it.
-    if (!find_tables(&there, &failed))
+    // Only after the links have changed: the routes of a link that was replaced are gone with it.
+    if (!find_routes_and_rules(&there, &failed))
         return failed.give(out_error);
     add_routes(wanted, there.routes, &failed);
     add_rules(wanted, there.rules, &failed);
@@ -274,7 +274,8 @@ bool reconcile_kernel_links(const data_plane &plane, const wanted_state &wanted,
     failure failed;
     out_indices->clear();
     kernel_view there;
-    if (!reconcile_links(plane, wanted, &there, out_indices, &failed) || !find_tables(&there, &failed))
+    if (!reconcile_links(plane, wanted, &there, out_indices, &failed) ||
+        !find_routes_and_rules(&there, &failed))
         return failed.give(out_error);
     wanted_state missing = wanted;
     std::erase_if(missing.routes, [&](const wanted_route &route) {
@@ -284,7 +285,7 @@ bool reconcile_kernel_links(const data_plane &plane, const wanted_state &wanted,
     });
     add_routes(missing, there.routes, &failed);
     add_rules(wanted, there.rules, &failed);
-    // The number of a link that goes may be another's soon, and its table with it.
+    // The number of a removed link, and with it its table, can soon belong to another link.
     const auto is_of_link = [&](uint32_t table) {
         return std::any_of(wanted.links.begin(), wanted.links.end(), [&](const wanted_link &link) {
             return table == TABLE_LINK_FIRST + link_number(link.name).value_or(0);
@@ -308,7 +309,7 @@ bool remove_kernel_state(const data_plane &plane, std::string *out_error) {
     failure failed;
     const wanted_state nothing;
     if (&plane == &table_plane) {
-        drop_unwanted_made(plane, nothing, &failed);
+        drop_unwanted_made_links(plane, nothing, &failed);
         return failed.give(out_error);
     }
     std::string error;
@@ -316,7 +317,7 @@ bool remove_kernel_state(const data_plane &plane, std::string *out_error) {
         failed.note(error);
     kernel_view there;
     failed.note("cannot list links", find_links(false, &there.links));
-    find_tables(&there, &failed);
+    find_routes_and_rules(&there, &failed);
     remove_unwanted(plane, nothing, there, &failed);
     return failed.give(out_error);
 }

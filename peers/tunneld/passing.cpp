@@ -13,8 +13,8 @@ constexpr uint8_t ALTERNATIVE_USED = 0x40; // of the redirect header's flags
 constexpr size_t BUCKETS = 256;
 constexpr uint8_t FLOW_FLAGS = TCP_FIN | TCP_SYN | TCP_RST | TCP_ACK;
 
-// The TCP header of a whole packet, or null.
-const tcp_wire_header *tcp_of(const gre_content &content) {
+// Null for other protocols and for fragments.
+const tcp_wire_header *find_tcp_header(const gre_content &content) {
     const auto *ip = reinterpret_cast<const ip4_wire_header *>(content.packet);
     const size_t header = ip4_header_length(*ip);
     if (ip->protocol != PROTOCOL_TCP || (to_host(ip->fragment) & IP4_FRAGMENT) ||
@@ -52,7 +52,7 @@ uint32_t find_passing_member(const passing_lookup &lookup, const gre_content &co
         return 0;
     const uint32_t member = service->members[redirect.flags & ALTERNATIVE_USED ? redirect.alternative_bucket
                                                                                : redirect.primary_bucket];
-    const tcp_wire_header *tcp = member ? tcp_of(content) : nullptr;
+    const tcp_wire_header *tcp = member ? find_tcp_header(content) : nullptr;
     if (!tcp || (tcp->flags & FLOW_FLAGS) == TCP_SYN ||
         !service->ports[to_host(service->by_source_port ? tcp->source_port : tcp->destination_port)])
         return 0;
@@ -60,8 +60,10 @@ uint32_t find_passing_member(const passing_lookup &lookup, const gre_content &co
     return member;
 }
 
-// --- The file: NUMBER LOCAL source|destination PORTS COUNT*MEMBER ..., where PORTS are "all" or separated by
-// commas.
+// --- The file
+//
+// A line for each group: NUMBER LOCAL source|destination PORTS COUNT*MEMBER ..., where PORTS are "all" or
+// ranges separated by commas, and each COUNT*MEMBER is a run of buckets with the same member.
 
 std::string passing_file_text(const passing_table &table) {
     std::ostringstream text;
@@ -85,7 +87,7 @@ std::string passing_file_text(const passing_table &table) {
 
 namespace {
 
-bool take_line(const std::string &line, unsigned *out_number, passing_group *out) {
+bool take_passing_line(const std::string &line, unsigned *out_number, passing_group *out) {
     std::istringstream words(line);
     std::string local, kind, ports, run;
     if (!(words >> *out_number >> local >> kind >> ports) || *out_number > 255 ||
@@ -117,7 +119,7 @@ passing_table read_passing_file(const std::string &text) {
     for (std::string line; std::getline(lines, line);) {
         unsigned number = 0;
         passing_group group;
-        if (take_line(line, &number, &group))
+        if (take_passing_line(line, &number, &group))
             table[static_cast<uint8_t>(number)] = std::move(group);
     }
     return table;

@@ -20,8 +20,8 @@ int64_t now_s() {
     return lt_monotonic_ms() / 1000;
 }
 
-// A reader finds the old file or the new one.
-void write_file(const char *path, const std::string &text) {
+// Replaces the file in one step: a reader finds either the old file or the new one.
+void write_kept_file(const char *path, const std::string &text) {
     const std::string fresh = std::string(path) + ".new";
     (void)mkdir("/run/tunneld", 0755);
     std::ofstream file(fresh, std::ios::trunc);
@@ -31,7 +31,7 @@ void write_file(const char *path, const std::string &text) {
         LC_LOG(LC_LOG_WARNING, "%s: %s", path, strerror(errno));
 }
 
-std::string read_file(const char *path) {
+std::string read_kept_file(const char *path) {
     std::ifstream file(path);
     std::string text(FILE_MAX, '\0');
     file.read(text.data(), static_cast<std::streamsize>(text.size()));
@@ -42,20 +42,20 @@ std::string read_file(const char *path) {
 } // namespace
 
 owners_table load_owners() {
-    return read_owners_file(read_file(OWNERS_FILE), now_s());
+    return read_owners_file(read_kept_file(OWNERS_FILE), now_s());
 }
 
 passing_table load_passing() {
-    return read_passing_file(read_file(PASSING_FILE));
+    return read_passing_file(read_kept_file(PASSING_FILE));
 }
 
 void save_passing(const passing_table &table) {
-    write_file(PASSING_FILE, passing_file_text(table));
+    write_kept_file(PASSING_FILE, passing_file_text(table));
 }
 
 bool take_owners(owners_table *owners, uint8_t group, const std::string &text, uint32_t protection_s) {
     owners_report report;
-    if (text.empty()) // nothing is known yet
+    if (text.empty()) // wccpd does not know the owners yet
         return false;
     if (!parse_owners(text, &report)) {
         LC_LOG(LC_LOG_WARNING, "Group %d: the owners of its slots cannot be read", group);
@@ -63,13 +63,13 @@ bool take_owners(owners_table *owners, uint8_t group, const std::string &text, u
     }
     if (!note_owners(owners, group, report, now_s(), protection_s))
         return false;
-    write_file(OWNERS_FILE, owners_file_text(*owners));
+    write_kept_file(OWNERS_FILE, owners_file_text(*owners));
     return true;
 }
 
 void keep_owners_of(owners_table *owners, const std::map<uint8_t, group_view> &groups) {
     if (std::erase_if(*owners, [&](const auto &each) { return !groups.contains(each.first); }) > 0)
-        write_file(OWNERS_FILE, owners_file_text(*owners));
+        write_kept_file(OWNERS_FILE, owners_file_text(*owners));
 }
 
 std::map<uint8_t, group_protection> find_protections(const owners_table &owners,

@@ -1,15 +1,15 @@
-// The session with mgmtd, on the program's loop. Nothing here waits: the opening, each request and its answer
-// are steps that the loop comes back for, so that the mailbox is served whatever mgmtd does, stopped or slow.
-// No dispatch is nested, and a callback of the library only notes what came; what follows from it is done by
-// advance(), which the timer calls without any lock held.
+// The session with mgmtd, on the program's event loop. Nothing here waits: opening the session, sending a
+// request and processing its answer are separate steps of the loop, so that the mailbox is served even if
+// mgmtd is slow or stopped. The library's callbacks run with its locks held and only store what was received;
+// advance_session(), called by the timer without a lock, does the rest.
 //
-// The configuration is read whole after the session has opened and again after each change of it: it is
-// small, and there is no second way to apply it. wccpd's state has no change event. It is asked for after a
-// change, after a role has changed and whenever the caller says so (tunnels come and go with routers), every
-// few seconds while something of it is missing, and now and then for the rest.
+// The configuration is read as a whole when the session has opened and after each change. It is small, and
+// there is only one way to apply it. wccpd's state has no change event. It is queried after a change of the
+// configuration or of a role, when the caller asks for it (tunnels are added with new routers), every few
+// seconds while part of it is missing, and otherwise every 30 seconds.
 //
-// What is known stays when the session is lost. A router that wccpd no longer lists is kept for as long as a
-// tunnel of a wccpd that has been started again, since that wccpd asks its routers anew.
+// When the session is lost, what was received stays valid. A router that wccpd no longer lists is kept for as
+// long as the tunnels of a restarted wccpd, since a new wccpd contacts its routers again.
 #include "peers/tunneld/session.h"
 
 #include <algorithm>
@@ -35,19 +35,20 @@
 namespace {
 constexpr int32_t SERVICE = 2;
 constexpr int64_t RETRY_MS = 1000;        // between attempts to connect
-constexpr int64_t OPENING_STEP_MS = 10;   // between looks at a session that is being opened, at first
+constexpr int64_t OPENING_STEP_MS = 10;   // between the first looks at a session that is being opened
 constexpr int64_t OPENING_MAX_MS = 10000; // for the whole opening
-constexpr int64_t ANSWER_MAX_MS = 15000;  // then a request is made again
-// Between questions about routers: after what may have changed them, doubled with each; from the second on
-// only while something is missing, up to the third; when nothing is.
+constexpr int64_t ANSWER_MAX_MS = 15000;  // after which a request is sent again
+// The time between queries about routers. It starts with the first value after a possible change and doubles
+// with each query: always up to the second value, and up to the third while something is missing. When
+// nothing is missing, it is the fourth.
 constexpr int64_t ROUTERS_FIRST_MS = 50, ROUTERS_SETTLED_MS = 1000, ROUTERS_MISSING_MS = 5000,
                   ROUTERS_KNOWN_MS = 30000;
-constexpr int64_t OWNERS_MS = 2000;       // between questions about the owners of slots
-constexpr int64_t ROUTER_KEPT_MS = 60000; // after wccpd listed it last
+constexpr int64_t OWNERS_MS = 2000;       // between queries about the owners of slots
+constexpr int64_t ROUTER_KEPT_MS = 60000; // since wccpd has last listed it
 constexpr int64_t NEVER = INT64_MAX;
 constexpr size_t REASON_MAX = 256;
-// Groups whose routers are asked for in one request. wccpd answers nobody else meanwhile; with 32 routers
-// each, it needs some 20 ms for these.
+// Groups whose routers are queried with one request. wccpd answers no other request meanwhile; with 32
+// routers each, it needs some 20 ms for these.
 constexpr size_t GROUPS_AT_ONCE = 8;
 
 struct known_router {
@@ -55,7 +56,7 @@ struct known_router {
     int64_t seen_ms;
 };
 struct request {
-    uint32_t id = 0; // of the message that is under way, or 0
+    uint32_t id = 0; // of the message that waits for an answer, or 0
     int64_t deadline_ms = 0;
 };
 using known_routers = std::map<std::pair<uint8_t, uint32_t>, known_router>; // by group and router id
@@ -72,18 +73,19 @@ struct mgmt_link {
     uint32_t sessions = 0;
     int64_t connect_at_ms = 0, opened_ms = 0; // `opened_ms`: when the opening began
 
-    request configuration, groups, routers, owners; // that are under way
+    request configuration, groups, routers, owners; // that wait for an answer
     int64_t read_at_ms = NEVER, ask_routers_at_ms = NEVER, ask_wait_ms = ROUTERS_FIRST_MS;
     int64_t ask_owners_at_ms = NEVER;
-    bool routers_are_due = false;                               // once the groups are known
-    std::vector<node_name> unasked;                             // groups that further requests ask about
-    std::vector<event_field> gathered;                          // what earlier ones have answered
-    std::vector<event_field> configured, listed, states, owned; // answers, as they came
+    bool routers_are_due = false;      // to be queried when the list of groups has arrived
+    std::vector<node_name> unasked;    // groups that further queries are about
+    std::vector<event_field> gathered; // the answers to earlier ones
+    // Answers that advance_session() has yet to process, one for each of the requests above.
+    std::vector<event_field> configured, listed, states, owned;
     bool has_configured = false, has_listed = false, has_states = false, has_owned = false;
 
-    bool announced = false; // `view` has been given to the caller in this session
+    bool announced = false; // the caller has been called with `view` in this session
     configured_view view;
-    std::map<uint8_t, size_t> expected; // routers, by the groups that are up
+    std::map<uint8_t, size_t> expected; // number of configured routers by group, of groups that are up
     known_routers known;
     std::map<uint8_t, group_role> roles;
     std::vector<std::string> complaints;
@@ -156,7 +158,9 @@ void ask_routers_now(mgmt_link *link) {
     link->ask_wait_ms = ROUTERS_FIRST_MS;
 }
 
-// --- What comes. These run inside the library, with its locks held.
+// --- Answers and events
+//
+// The callbacks are called by the library with its locks held.
 
 void log_complaints(mgmt_link *link, std::vector<std::string> complaints) {
     if (complaints != link->complaints)
@@ -165,7 +169,7 @@ void log_complaints(mgmt_link *link, std::vector<std::string> complaints) {
     link->complaints = std::move(complaints);
 }
 
-// The answer to `waiting`, if that is what it is. A refused one is an answer without nodes.
+// False when the message is not the answer to `waiting`. `out_came`: it is one with nodes, not a refusal.
 bool take_answer(request *waiting, const bn_response_msg *msg, std::vector<event_field> *out,
                  bool *out_came) {
     if (waiting->id == 0 || msg->response_to != waiting->id)
@@ -180,8 +184,8 @@ bool take_answer(request *waiting, const bn_response_msg *msg, std::vector<event
 lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) {
     auto *link = static_cast<mgmt_link *>(data);
     if (take_answer(&link->configuration, msg, &link->configured, &link->has_configured)) {
-        if (!link->has_configured) { // as after a time in which this program has read nothing
-            log_complaints(link, {std::string("the configuration is not given: ") +
+        if (!link->has_configured) { // for example when this program has not read from the session for long
+            log_complaints(link, {std::string("The configuration was refused: ") +
                                   (msg->return_message ? ts_str(msg->return_message) : "")});
             link->read_at_ms = std::min(link->read_at_ms, lt_monotonic_ms() + RETRY_MS);
         }
@@ -210,9 +214,9 @@ lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
 
 // --- State queries
 
-using state_tree = std::map<node_name, const state_node *>; // null for a node that only has others below it
+using state_tree = std::map<node_name, const state_node *>; // null: a node without a value, above others
 
-state_tree tree_of(const std::vector<state_node> &nodes) {
+state_tree build_state_tree(const std::vector<state_node> &nodes) {
     state_tree out;
     for (const state_node &node : nodes) {
         node_name name = parsed_name(node.name);
@@ -225,7 +229,7 @@ state_tree tree_of(const std::vector<state_node> &nodes) {
     return out;
 }
 
-// Such a node is there so that it can be listed; its value is its own last part.
+// A node that stands for one of many has no value of its own: the value is the last part of its name.
 bool is_one_of_many(const node_name &name) {
     static const node_name patterns[] = {
         parsed_name(NODE_TUNNEL_STATE "/*"), parsed_name(NODE_INTERCEPT_STATE "/*"),
@@ -260,7 +264,7 @@ lc_status iterate_state(const char *name, const tstr_array *, void *data, tstr_a
 lc_status take_query(gcl_session *session, bn_request_msg *msg, void *data) {
     auto *link = static_cast<mgmt_link *>(data);
     const std::vector<state_node> nodes = link->callbacks.state();
-    state_tree tree = tree_of(nodes);
+    state_tree tree = build_state_tree(nodes);
     CHECK_STATUS(mdc_dispatch_mon_request(session, msg, get_state, &tree, iterate_state, &tree));
     return LC_OK;
 }
@@ -274,7 +278,7 @@ lc_status take_close(int, uint32_t, void *, void *data) {
 
 void drop_session(mgmt_link *link) {
     if (link->stage == mgmt_link::open)
-        LC_LOG(LC_LOG_NOTICE, "session with mgmtd lost; tunnels and intercepts stay as they are");
+        LC_LOG(LC_LOG_NOTICE, "Session with mgmtd lost; tunnels and intercepts stay as they are");
     link->stage = mgmt_link::closed;
     LOG_STATUS(gcl_session_free(&link->session));
     link->configuration = link->groups = link->routers = link->owners = {};
@@ -283,7 +287,7 @@ void drop_session(mgmt_link *link) {
     link->connect_at_ms = lt_monotonic_ms() + RETRY_MS;
 }
 
-// An attempt each second, for as long as nobody listens, is nothing to log.
+// Logs nothing: while mgmtd is not there, this is tried every second.
 void connect_quietly(mgmt_link *link) {
     link->connect_at_ms = lt_monotonic_ms() + RETRY_MS;
     if (access(provider_path().c_str(), W_OK) != 0)
@@ -301,20 +305,20 @@ void connect_quietly(mgmt_link *link) {
     link->opened_ms = lt_monotonic_ms();
 }
 
-// An interest in changes is also what makes mgmtd ask this session for tunneld's state.
+// The interest in changes also makes mgmtd send queries about tunneld's state to this session.
 void begin_session(mgmt_link *link) {
     link->stage = mgmt_link::open;
     link->sessions++;
-    LC_LOG(LC_LOG_NOTICE, "session with mgmtd open");
+    LC_LOG(LC_LOG_NOTICE, "Session with mgmtd open");
     if (!send_interest(link, EVENT_CONFIG_CHANGE, {"/qv/tunneld/**", NODE_WCCPD "/**"}) ||
         !send_interest(link, EVENT_ROLE_CHANGE, {}) || !send_interest(link, EVENT_DRAIN, {}))
-        LC_LOG(LC_LOG_WARNING, "changes of the configuration cannot be followed");
+        LC_LOG(LC_LOG_WARNING, "Changes of the configuration cannot be followed: no interest could be sent");
     link->read_at_ms = lt_monotonic_ms();
-    for (auto &[key, known] : link->known) // while nobody could be asked they have not aged
+    for (auto &[key, known] : link->known) // without a session wccpd could not be asked about them
         known.seen_ms = link->read_at_ms;
 }
 
-void step_opening(mgmt_link *link) {
+void continue_opening(mgmt_link *link) {
     int32_t admin = 0;
     (void)gcl_session_get_state(link->session, nullptr, &admin);
     if (link->stage == mgmt_link::greeting && admin == GCL_ADMIN_GREETED) {
@@ -337,10 +341,10 @@ bool is_connected(const mgmt_link *link) {
            state == GCL_SESSION_CONNECTED;
 }
 
-// --- What is known
+// --- The view
 
 std::map<std::string, uint32_t> find_interface_addresses() {
-    std::map<std::string, uint32_t> out; // the first of each
+    std::map<std::string, uint32_t> out; // the first address of each interface
     ifaddrs *list = nullptr;
     if (getifaddrs(&list) != 0)
         return out;
@@ -352,7 +356,7 @@ std::map<std::string, uint32_t> find_interface_addresses() {
     return out;
 }
 
-void take_configuration(mgmt_link *link, configured_view *next) {
+void take_configuration_answer(mgmt_link *link, configured_view *next) {
     std::vector<std::string> complaints;
     *next = read_configuration(link->configured, &complaints);
     link->expected = count_configured_routers(link->configured);
@@ -360,7 +364,7 @@ void take_configuration(mgmt_link *link, configured_view *next) {
     link->configured.clear();
 }
 
-// Methods are negotiated anew when a router answers again; until then the flows go as they went.
+// While the methods are negotiated again with a router that has come back, the old ones stay in use.
 void take_routers(mgmt_link *link) {
     const int64_t now = lt_monotonic_ms();
     for (const auto &[group, routers] : read_group_routers(link->states))
@@ -383,7 +387,7 @@ void forget_old_routers(mgmt_link *link) {
     });
 }
 
-// Whether each group that is up has as many routers as are configured, all with their methods, and is ACTIVE.
+// Whether each group that is up is ACTIVE and has all of its configured routers, with their methods.
 bool knows_all_routers(const mgmt_link *link) {
     std::map<uint8_t, size_t> good;
     for (const auto &[key, known] : link->known) {
@@ -399,7 +403,7 @@ bool knows_all_routers(const mgmt_link *link) {
     });
 }
 
-void add_what_wccpd_says(const mgmt_link *link, configured_view *inout) {
+void fill_in_wccpd_state(const mgmt_link *link, configured_view *inout) {
     const std::map<std::string, uint32_t> addresses = find_interface_addresses();
     for (auto &[id, group] : inout->groups) {
         const auto found = addresses.find(group.interface);
@@ -414,17 +418,12 @@ void add_what_wccpd_says(const mgmt_link *link, configured_view *inout) {
     }
 }
 
-bool same(const configured_view &a, const configured_view &b) {
-    return a.groups == b.groups && a.intercepts == b.intercepts && a.bypasses == b.bypasses &&
-           a.accepted == b.accepted && a.protection_s == b.protection_s && a.drains == b.drains;
-}
-
 bool wants_owners(const mgmt_link *link) {
     return link->announced && link->view.protection_s != 0 && !link->view.intercepts.empty();
 }
 
-// Asks about the routers of the next groups.
-void ask_about_routers(mgmt_link *link) {
+// Queries the routers of the next groups.
+void query_routers(mgmt_link *link) {
     std::vector<std::string> walks, single_nodes;
     const size_t count = std::min(link->unasked.size(), GROUPS_AT_ONCE);
     for (size_t i = 0; i < count; i++) {
@@ -436,8 +435,8 @@ void ask_about_routers(mgmt_link *link) {
     (void)send_queries(link, bn_query_iterate, walks, bn_qf_subtree, &link->routers, single_nodes);
 }
 
-// The groups that wccpd runs are asked for by name: a question about another would be an error in its log.
-void ask_about_groups(mgmt_link *link) {
+// Queries only the groups that wccpd has listed: it logs an error for a query about any other group.
+void query_listed_groups(mgmt_link *link) {
     static const node_name root = parsed_name(NODE_GROUP_STATE);
     std::vector<std::string> owners;
     link->unasked.clear();
@@ -451,7 +450,7 @@ void ask_about_groups(mgmt_link *link) {
     link->listed.clear();
     link->gathered.clear();
     if (!link->unasked.empty())
-        ask_about_routers(link);
+        query_routers(link);
     if (!owners.empty() && wants_owners(link))
         (void)send_queries(link, bn_query_get, owners, 0, &link->owners);
 }
@@ -462,12 +461,12 @@ int64_t routers_wait_ms(const mgmt_link *link) {
                : std::min(link->ask_wait_ms, ROUTERS_MISSING_MS);
 }
 
-// Takes in what has come, and gives the caller what has changed.
-void digest(mgmt_link *link) {
+// Processes the answers that have come, and calls the caller with the changed view.
+void process_answers(mgmt_link *link) {
     configured_view next = link->view;
     const bool configured = link->has_configured;
     if (configured) {
-        take_configuration(link, &next);
+        take_configuration_answer(link, &next);
         ask_routers_now(link);
     }
     if (link->has_states) {
@@ -476,11 +475,11 @@ void digest(mgmt_link *link) {
         if (link->has_states)
             link->states = std::move(link->gathered);
         else
-            ask_about_routers(link);
+            query_routers(link);
     }
     const bool answered = link->has_listed || link->has_states;
     if (link->has_listed)
-        ask_about_groups(link);
+        query_listed_groups(link);
     if (link->has_states) {
         link->roles = read_group_roles(link->states);
         take_routers(link);
@@ -496,28 +495,30 @@ void digest(mgmt_link *link) {
             link->callbacks.owners(group, text);
     if (!configured && (!answered || !link->announced))
         return;
-    add_what_wccpd_says(link, &next);
-    if (link->announced && same(next, link->view))
+    fill_in_wccpd_state(link, &next);
+    if (link->announced && next == link->view)
         return;
     link->announced = true;
     link->view = std::move(next);
     link->callbacks.configured(link->view);
 }
 
+// Whether a request of this kind is due and none waits for an answer. One that has waited too long is given
+// up.
 bool may_ask(request *inout, int64_t at_ms, int64_t now) {
     if (inout->id && now >= inout->deadline_ms)
         inout->id = 0;
     return !inout->id && now >= at_ms;
 }
 
-// When something about wccpd's groups is to be asked.
-int64_t next_question_ms(const mgmt_link *link) {
+// When wccpd's groups are to be queried next.
+int64_t next_group_query_ms(const mgmt_link *link) {
     return wants_owners(link) ? std::min(link->ask_routers_at_ms, link->ask_owners_at_ms)
                               : link->ask_routers_at_ms;
 }
 
-// Requests that are due. One of a kind is under way at a time.
-void ask(mgmt_link *link) {
+// Sends the requests that are due. At most one of each kind waits for an answer.
+void send_due_requests(mgmt_link *link) {
     const int64_t now = lt_monotonic_ms();
     if (may_ask(&link->configuration, link->read_at_ms, now)) {
         link->read_at_ms = NEVER;
@@ -528,7 +529,7 @@ void ask(mgmt_link *link) {
             link->read_at_ms = now + RETRY_MS;
     }
     if (!may_ask(&link->routers, now, now) || !may_ask(&link->owners, now, now) ||
-        !may_ask(&link->groups, next_question_ms(link), now))
+        !may_ask(&link->groups, next_group_query_ms(link), now))
         return;
     (void)send_walks(link, {NODE_GROUP_STATE}, 0, &link->groups);
     link->ask_owners_at_ms = now + OWNERS_MS;
@@ -559,21 +560,21 @@ int64_t next_step_ms(const mgmt_link *link) {
     if (!link->configuration.id)
         next = std::min(next, link->read_at_ms);
     if (!link->groups.id && !link->routers.id && !link->owners.id)
-        next = std::min(next, next_question_ms(link));
+        next = std::min(next, next_group_query_ms(link));
     return next == NEVER ? ROUTERS_KNOWN_MS : next - now;
 }
 
-void advance(int, short, void *data) {
+void advance_session(int, short, void *data) {
     auto *link = static_cast<mgmt_link *>(data);
     if (link->stage != mgmt_link::closed && !is_connected(link))
         drop_session(link);
     if (link->stage == mgmt_link::closed && lt_monotonic_ms() >= link->connect_at_ms)
         connect_quietly(link);
     else if (link->stage == mgmt_link::greeting || link->stage == mgmt_link::opening)
-        step_opening(link);
+        continue_opening(link);
     if (link->stage == mgmt_link::open) {
-        digest(link);
-        ask(link);
+        process_answers(link);
+        send_due_requests(link);
     }
     LOG_STATUS(loop_event_set_timer(link->timer, std::max<int64_t>(next_step_ms(link), 0)));
 }
@@ -590,7 +591,7 @@ lc_status make_instance(mgmt_link *link, lew *loop) {
     CHECK_STATUS(bn_set_global_callback_event_response_msg(link->instance, ignore_response, link));
     CHECK_STATUS(bn_set_global_callback_event_request_msg(link->instance, take_event, link));
     CHECK_STATUS(bn_set_global_callback_query_request_msg(link->instance, take_query, link));
-    CHECK_STATUS(loop_event_new(context, advance, link, &link->timer));
+    CHECK_STATUS(loop_event_new(context, advance_session, link, &link->timer));
     CHECK_STATUS(loop_event_set_timer(link->timer, 0));
     return LC_OK;
 }
@@ -608,7 +609,7 @@ mgmt_link *mgmt_link_new(lew *loop, session_callbacks callbacks) {
 void mgmt_link_free(mgmt_link *link) {
     if (!link)
         return;
-    if (link->bridge) // what is closed from here on calls nobody
+    if (link->bridge) // gcl_deinit() closes descriptors, and the handler must not run any more
         LOG_STATUS(fdic_libevent_set_fd_close_handler(link->bridge, nullptr, nullptr));
     LOG_STATUS(gcl_deinit(&link->instance));
     LOG_STATUS(fdic_libevent_deinit(&link->bridge));
@@ -634,12 +635,14 @@ void mgmt_link_ask_routers(mgmt_link *link) {
 
 // --- Events
 
-static event_field group_field(uint8_t group) {
+namespace {
+event_field group_field(uint8_t group) {
     return {"group", {bn_type_uint8, std::to_string(group)}};
 }
-static event_field reason_field(const std::string &reason) {
+event_field reason_field(const std::string &reason) {
     return {"reason", {bn_type_str, shown_text(reason.substr(0, REASON_MAX))}};
 }
+} // namespace
 
 void mgmt_link_group_leaves(mgmt_link *link, uint8_t group, const std::string &reason) {
     send_event(link, EVENT_GROUP_LEAVE, {group_field(group), reason_field(reason)});

@@ -8,7 +8,7 @@
 #include "peers/tunneld/link_names.h"
 #include "peers/tunneld/session_config.h"
 
-// --- wccpd's text
+// --- The text of wccpd
 
 namespace {
 
@@ -42,7 +42,7 @@ bool take_mask(std::istringstream *words, slot_mask *out) {
     return slot_mask_bits(*out) <= 7;
 }
 
-bool take_run(const std::string &word, std::vector<uint32_t> *out) {
+bool take_owner_run(const std::string &word, std::vector<uint32_t> *out) {
     const size_t star = word.find('*');
     uint32_t owner = 0;
     size_t count = 0;
@@ -91,7 +91,7 @@ bool parse_owners(const std::string &text, owners_report *out) {
             in_owners = true;
             continue;
         }
-        if (in_owners ? !take_run(word, &out->owners)
+        if (in_owners ? !take_owner_run(word, &out->owners)
                       : out->members.size() == GROUP_MEMBERS_MAX || !parse_address(word, &member) || !member)
             return false;
         if (!in_owners)
@@ -107,9 +107,9 @@ bool parse_owners(const std::string &text, owners_report *out) {
 namespace {
 
 void replace_owner(slot_history *slot, uint32_t owner, int64_t now_s) {
-    if (owner == 0 || owner == slot->owner) // nobody: it stays with the one who had it
+    if (owner == 0 || owner == slot->owner) // 0: the flows are still with the appliance that had the slot
         return;
-    // Who had it before the first report is not known, and therefore had it long ago.
+    // An owner in the first report counts as owner since ever, since nothing is known about the time before.
     if (slot->owner != 0 && slot->since_s < now_s)
         slot->former.insert(slot->former.begin(), {slot->owner, slot->since_s, now_s});
     slot->since_s = slot->owner == 0 ? 0 : now_s;
@@ -120,7 +120,7 @@ void replace_owner(slot_history *slot, uint32_t owner, int64_t now_s) {
 
 bool note_owners(owners_table *table, uint8_t group, const owners_report &report, int64_t now_s,
                  int64_t keep_s) {
-    if (report.members.empty()) // a wccpd that has just begun
+    if (report.members.empty()) // wccpd has just been started
         return false;
     const auto found = table->find(group);
     group_owners next = found == table->end() ? group_owners{} : found->second;
@@ -154,7 +154,7 @@ std::vector<uint32_t> slot_targets(const group_owners &group, uint32_t self, int
             targets.back() = slot.owner;
             continue;
         }
-        const auto left = [&](int64_t time_s) { // of the flows that began then
+        const auto left = [&](int64_t time_s) { // share of the flows that began at this time
             return std::exp(-static_cast<double>(now_s - time_s) / static_cast<double>(protection_s));
         };
         std::map<uint32_t, double> flows;
@@ -173,8 +173,8 @@ std::vector<uint32_t> slot_targets(const group_owners &group, uint32_t self, int
 
 // --- The file
 //
-// A line for each group: its number, kind and members as wccpd has them, "slots", and for each run of slots
-// with the same history COUNT*OWNER,SINCE;FORMER,FROM,UNTIL;...
+// A line for each group: its number, the kind, mask and members as in wccpd's text, "slots", and for each run
+// of slots with the same history COUNT*OWNER,SINCE;FORMER,FROM,UNTIL;...
 
 namespace {
 
@@ -215,7 +215,7 @@ bool take_history(const std::string &text, int64_t now_s, slot_history *out) {
     return true;
 }
 
-bool take_line(const std::string &line, int64_t now_s, uint8_t *out_number, group_owners *out) {
+bool take_owners_line(const std::string &line, int64_t now_s, uint8_t *out_number, group_owners *out) {
     const size_t blank = line.find(' '), slots = line.find(" slots");
     size_t number = 0;
     owners_report head;
@@ -271,7 +271,7 @@ owners_table read_owners_file(const std::string &text, int64_t now_s) {
     for (std::string line; std::getline(lines, line);) {
         uint8_t number = 0;
         group_owners group;
-        if (take_line(line, now_s, &number, &group))
+        if (take_owners_line(line, now_s, &number, &group))
             table[number] = std::move(group);
     }
     return table;

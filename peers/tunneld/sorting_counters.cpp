@@ -1,4 +1,4 @@
-// Reads back what the sorting rules have counted.
+// Reads the counters of the sorting rules.
 #include <arpa/inet.h>
 
 #include <sstream>
@@ -9,7 +9,7 @@
 
 namespace {
 
-bool read_address(const nlohmann::json &value, uint32_t *out) {
+bool read_json_address(const nlohmann::json &value, uint32_t *out) {
     const std::string text = value.is_string() ? value.get<std::string>() : "";
     in_addr address{};
     if (inet_pton(AF_INET, text.c_str(), &address) != 1)
@@ -29,7 +29,7 @@ packet_count *find_way(packet_count (&ways)[SORTED_WAYS], const std::string &wor
     return nullptr;
 }
 
-// By the parts of the counter's name.
+// The name says which counter it is: see sorting_text.h.
 void take_counter(sorting_counters *out, const std::string &name, const packet_count &count) {
     if (name == CLAMPED_COUNTER)
         out->clamped = count.packets;
@@ -49,12 +49,12 @@ void take_counter(sorting_counters *out, const std::string &name, const packet_c
         ways[SORTED_IN].bytes += count.bytes;
     } else if (kind == "fragments") {
         tunnel_ends ends;
-        if (read_address(of, &ends.local) && read_address(what, &ends.remote))
+        if (read_json_address(of, &ends.local) && read_json_address(what, &ends.remote))
             out->fragments[ends] = count.packets;
     }
 }
 
-// The elements of a set: "SOURCE . DESTINATION", and the count, 0 where the set has none.
+// Lists the elements of a set of pairs, source and destination, each with its count, or 0 if it has none.
 bool list_pairs(const char *set, std::map<std::pair<uint32_t, uint32_t>, uint64_t> *out,
                 std::string *out_error) {
     nlohmann::json objects;
@@ -68,7 +68,8 @@ bool list_pairs(const char *set, std::map<std::pair<uint32_t, uint32_t>, uint64_
             const nlohmann::json &value = counts ? element["elem"].value("val", nlohmann::json()) : element;
             uint32_t source = 0, destination = 0;
             if (!value.is_object() || !value.contains("concat") || value["concat"].size() != 2 ||
-                !read_address(value["concat"][0], &source) || !read_address(value["concat"][1], &destination))
+                !read_json_address(value["concat"][0], &source) ||
+                !read_json_address(value["concat"][1], &destination))
                 continue;
             (*out)[{source, destination}] = counts && element["elem"].contains("counter")
                                                 ? read_count(element["elem"]["counter"]).packets
@@ -98,7 +99,7 @@ bool read_sorting_counters(sorting_counters *out, std::string *out_error) {
     if (!list_pairs(REFUSED_SET, &refused, out_error) || !list_pairs(ENDS_SET, &ends, out_error))
         return false;
     for (const auto &[pair, packets] : refused)
-        if (!ends.contains(pair)) // accepted since
+        if (!ends.contains(pair)) // otherwise it has been accepted since
             out->refused_sources[pair.first] += packets;
     return true;
 }

@@ -7,9 +7,9 @@
 
 namespace {
 
-std::optional<nft_content> held; // what the table holds, as far as this process has brought it about
+std::optional<nft_content> held; // the table's content, if this process has made it
 
-// As far as the types, in the form of sorting_text.cpp.
+// The declaration of a set or map in the form that sorting_text.cpp writes, up to the types.
 std::string declare_left_set(const std::string &kind, const nlohmann::json &body) {
     std::string types;
     const nlohmann::json type = body.value("type", nlohmann::json());
@@ -20,7 +20,8 @@ std::string declare_left_set(const std::string &kind, const nlohmann::json &body
     return kind + " { type " + types + ";";
 }
 
-// A set of another kind cannot hold what is wanted: nftables would look its elements up as names of hosts.
+// False when a set has other types than the wanted one of that name. nftables would take elements of another
+// type for host names and look them up.
 bool can_be_taken_over(const nft_content &left, const nft_content &wanted) {
     for (const auto &[name, set] : left.sets) {
         const auto at = wanted.sets.find(name);
@@ -30,7 +31,7 @@ bool can_be_taken_over(const nft_content &left, const nft_content &wanted) {
     return !left.empty();
 }
 
-// Names in the table that an earlier tunneld has left, or that somebody has changed.
+// Reads the names in a table that an earlier tunneld has left, or that somebody else has changed.
 bool read_left_content(nft_content *out, std::string *out_error) {
     *out = {};
     out->known = false;
@@ -65,7 +66,7 @@ bool is_table_there() {
     return false;
 }
 
-// Takes over what is in the table. What cannot be changed into the wanted content is replaced.
+// Changes the existing table into the wanted one. If that fails, replaces it, and the counters begin at 0.
 bool take_table_over(const nft_content &wanted, std::string *out_error) {
     nft_content left;
     if (!read_left_content(&left, out_error))
@@ -82,8 +83,8 @@ bool take_table_over(const nft_content &wanted, std::string *out_error) {
 
 constexpr const char *SCRATCH = "tunneld_probe";
 
-// Whether the kernel would take a table with a chain like this. Nothing of it is left.
-bool would_take(const std::string &hook, const std::string &rule, std::string *out_error) {
+// Whether the kernel would accept a table with such a chain. Nothing is changed.
+bool would_accept(const std::string &hook, const std::string &rule, std::string *out_error) {
     const std::string chain = std::string(" ip ") + SCRATCH + " probe ";
     return check_nft(std::string("add table ip ") + SCRATCH + "\nadd chain" + chain + "{ type filter hook " +
                          hook + " priority -150; }\nadd counter ip " + SCRATCH + " count\nadd rule" + chain +
@@ -131,10 +132,10 @@ std::string probe_sorting_rules() {
     std::string lacking;
     for (const auto &need : needs) {
         std::string error;
-        if (would_take(need.hook, need.rule, &error))
+        if (would_accept(need.hook, need.rule, &error))
             continue;
         lacking += (lacking.empty() ? "the kernel lacks " : ", ") + std::string(need.what);
-        if (&need == needs) // without it none of the others is to be had
+        if (&need == needs) // without nftables, all of the others are missing as well
             return lacking + " (" + error + ")";
     }
     return lacking;

@@ -18,13 +18,13 @@ constexpr const char *JUST_SYN = "tcp flags & (fin | syn | rst | ack) == syn";
 constexpr const char *NOT_JUST_SYN = "tcp flags & (fin | syn | rst | ack) != syn";
 
 template <typename... T>
-std::string format(const char *text, T... values) {
+std::string format_text(const char *text, T... values) {
     char line[512];
     const int length = snprintf(line, sizeof(line), text, values...);
     return std::string(line, std::min<size_t>(static_cast<size_t>(length), sizeof(line) - 1));
 }
 
-std::string quoted(const std::string &text) {
+std::string quote_name(const std::string &text) {
     return '"' + text + '"';
 }
 
@@ -33,15 +33,15 @@ std::string interface_counter(const std::string &name, const char *way) {
 }
 
 std::string group_counter(uint8_t group, sorted_as way) {
-    return format("counter name \"group/%u/%s\"", group, sorted_words[way]);
+    return format_text("counter name \"group/%u/%s\"", group, sorted_words[way]);
 }
 
 std::string mark_as(uint32_t mark) {
-    return format("meta mark set 0x%08x", mark);
+    return format_text("meta mark set 0x%08x", mark);
 }
 
 std::string group_chain(uint8_t group) {
-    return format("group/%u", group);
+    return format_text("group/%u", group);
 }
 
 bool is_safe_name(const std::string &name) {
@@ -50,7 +50,7 @@ bool is_safe_name(const std::string &name) {
     });
 }
 
-// Without prefixes that lie in others, which an interval set refuses.
+// An interval set refuses a prefix that lies within another: such ones are left out.
 std::set<std::string> merge_prefixes(std::vector<ip_prefix> prefixes) {
     const auto mask = [](uint8_t length) { return length == 0 ? 0 : ~0u << (32 - length); };
     for (ip_prefix &prefix : prefixes)
@@ -64,12 +64,12 @@ std::set<std::string> merge_prefixes(std::vector<ip_prefix> prefixes) {
         if (last && (prefix.address & mask(last->length)) == last->address)
             continue;
         last = &prefix;
-        merged.insert(address_text(prefix.address) + format("/%u", prefix.length));
+        merged.insert(address_text(prefix.address) + format_text("/%u", prefix.length));
     }
     return merged;
 }
 
-std::string join(const std::set<std::string> &words) {
+std::string join_with_commas(const std::set<std::string> &words) {
     std::string text;
     for (const std::string &word : words)
         text += (text.empty() ? "" : ", ") + word;
@@ -80,10 +80,10 @@ bool wants_something(const sorted_group &group) {
     return group.rules.to != 0;
 }
 
-// Ranges of ports that are taken, by their first: the last, and the group that takes them.
+// Ranges of ports and the groups they belong to: the last port and the group, by the first port.
 using taken_ports = std::map<uint32_t, std::pair<uint32_t, uint8_t>>;
 
-// What others have taken before stays theirs.
+// Gives the group those ports of the range that don't belong to another group yet.
 void take_ports(taken_ports *taken, uint32_t first, uint32_t last, uint8_t group) {
     while (first <= last) {
         const auto next = taken->upper_bound(first);
@@ -98,14 +98,14 @@ void take_ports(taken_ports *taken, uint32_t first, uint32_t last, uint8_t group
 }
 
 std::string port_text(uint32_t first, uint32_t last) {
-    return first == last ? format("%u", first) : format("%u-%u", first, last);
+    return first == last ? format_text("%u", first) : format_text("%u-%u", first, last);
 }
 
-// Everything below here fills one nft_content.
+// What all functions that fill the content need.
 struct content_maker {
     const wanted_sorting &wanted;
     nft_content &content;
-    std::set<std::string> interfaces; // all that packets are sorted from
+    std::set<std::string> interfaces; // all whose packets are sorted
 
     std::vector<std::string> &rules(const std::string &chain) { return content.chains[chain].rules; }
     void add_counter(const std::string &name) { content.counters.insert(name); }
@@ -115,21 +115,24 @@ struct content_maker {
     }
 };
 
-// One for each way: counts it by the interface, and gives the packet its verdict and mark.
+// A chain for each of sorted_words, which counts the packet by its interface and gives it its mark or
+// verdict.
 void add_way_chains(content_maker &maker) {
     for (const char *way : sorted_words) {
-        nft_set &map = maker.set(format("count_%s", way), "map { type ifname : counter; }");
+        nft_set &map = maker.set(format_text("count_%s", way), "map { type ifname : counter; }");
         for (const std::string &name : maker.interfaces) {
             maker.add_counter(interface_counter(name, way));
-            map.elements[quoted(name)] = quoted(interface_counter(name, way));
+            map.elements[quote_name(name)] = quote_name(interface_counter(name, way));
         }
     }
     nft_set &marks = maker.set("give_back", "map { type ifname : mark; }");
     for (const auto &[name, mark] : maker.wanted.l2_into_gre)
-        marks.elements[quoted(name)] = format("0x%08x", mark);
-    const auto count = [](const char *way) { return format("counter name iifname map @count_%s", way); };
-    // A packet without a mark takes the way of its interface: back through a link, on from an L2 interface.
-    const std::string unmarked = format("meta mark != 0x%08x ", MARK_LOCAL);
+        marks.elements[quote_name(name)] = format_text("0x%08x", mark);
+    const auto count = [](const char *way) { return format_text("counter name iifname map @count_%s", way); };
+    // A packet without a mark takes the way of its interface: out of a link it is returned through the link,
+    // from an L2 interface it is forwarded. A packet that must be delivered to this host has a mark already
+    // and keeps it.
+    const std::string unmarked = format_text("meta mark != 0x%08x ", MARK_LOCAL);
     for (const char *way : {"returned", "bypassed", "own", "down", "overload"})
         maker.rules(way) = {count(way), unmarked + "meta mark set iifname map @give_back"};
     maker.rules("passed") = {count("passed")};
@@ -139,8 +142,8 @@ void add_way_chains(content_maker &maker) {
     maker.rules("down_dropped") = {count("down"), "drop"};
 }
 
-// The masked fields of a packet as the key of a map, and those of a slot's value. Without a field all packets
-// belong to the one slot.
+// The fields that a mask can select, which become the key of a map. With an empty mask, there is only one
+// slot.
 struct mask_field {
     const char *name, *type;
     bool is_port;
@@ -154,10 +157,10 @@ constexpr mask_field mask_fields[] = {
 };
 
 std::string field_text(const mask_field &field, const slot_mask &of) {
-    return field.is_port ? format("%u", field.of(of)) : address_text(field.of(of));
+    return field.is_port ? format_text("%u", field.of(of)) : address_text(field.of(of));
 }
 
-// For each field that the mask has: the text that `make` gives, as one concatenation.
+// The texts that `make` returns for the fields in the mask, as a concatenation of nftables.
 template <typename F>
 std::string join_fields(const slot_mask &mask, F make) {
     std::string text;
@@ -167,15 +170,15 @@ std::string join_fields(const slot_mask &mask, F make) {
     return text;
 }
 
-// The rule that passes on what belongs to other appliances, but the match that comes before it. "": nothing
-// is ever passed on.
+// The rule that passes on packets of other appliances' slots; the caller puts a match before it. "" when no
+// packets are passed on.
 std::string make_pass_rule(content_maker &maker, const sorted_group &group) {
     if (group.pass_marks.empty())
         return "";
     const std::string end = " " + group_counter(group.group, SORTED_PASSED) + " goto passed";
     if (slot_mask_bits(group.mask) == 0)
         return group.pass_marks[0] ? mark_as(group.pass_marks[0]) + end : "";
-    const std::string name = format("pass/%u", group.group);
+    const std::string name = format_text("pass/%u", group.group);
     nft_set &map = maker.set(name, "map { type " + join_fields(group.mask, [](const mask_field &field) {
                                        return field.type;
                                    }) + " : mark; }");
@@ -184,7 +187,7 @@ std::string make_pass_rule(content_maker &maker, const sorted_group &group) {
             const slot_mask value = slot_value(group.mask, slot);
             map.elements[join_fields(group.mask, [&](const mask_field &field) {
                 return field_text(field, value);
-            })] = format("0x%08x", group.pass_marks[slot]);
+            })] = format_text("0x%08x", group.pass_marks[slot]);
         }
     return "meta mark set " +
            join_fields(group.mask,
@@ -198,7 +201,7 @@ void add_group_counters(content_maker &maker, const sorted_group &group) {
     for (const sorted_as way : {SORTED_TO_PROXY, SORTED_BYPASSED, SORTED_RETURNED, SORTED_DOWN,
                                 SORTED_FORWARDED, SORTED_DROPPED, SORTED_OVERLOAD, SORTED_PASSED})
         if (wants_something(group) || (way == SORTED_PASSED && !group.pass_marks.empty()))
-            maker.add_counter(format("group/%u/%s", group.group, sorted_words[way]));
+            maker.add_counter(format_text("group/%u/%s", group.group, sorted_words[way]));
 }
 
 void add_group(content_maker &maker, const sorted_group &group) {
@@ -209,9 +212,10 @@ void add_group(content_maker &maker, const sorted_group &group) {
     };
     if (!wish.bypass.empty())
         for (const char *end : {"saddr", "daddr"})
-            rules.push_back(format("ip %s { ", end) + join(merge_prefixes(wish.bypass)) + " } " +
-                            ends_as(SORTED_BYPASSED, "bypassed"));
-    // A flow that began before it was redirected stays with its server, unless it is another appliance's.
+            rules.push_back(format_text("ip %s { ", end) + join_with_commas(merge_prefixes(wish.bypass)) +
+                            " } " + ends_as(SORTED_BYPASSED, "bypassed"));
+    // A packet that begins no flow and has no socket here belongs to another appliance's proxy, or to a flow
+    // that is older than its redirection and stays with its server.
     const std::string pass = wish.protocol == 6 ? make_pass_rule(maker, group) : "";
     if (!pass.empty())
         rules.push_back(NOT_JUST_SYN + (" " + pass));
@@ -227,16 +231,16 @@ void add_group(content_maker &maker, const sorted_group &group) {
         rules.push_back(ends_as(SORTED_OVERLOAD, "overload"));
         return;
     }
-    // The proxy may listen on any address, on one of the interface, or on 127.0.0.1. The statement ends the
-    // rule when there is no such socket, and the next rule has its turn.
+    // The proxy may listen on any address, on one of the interface, or on 127.0.0.1. If there is no such
+    // socket, `tproxy` ends the rule, and the next rule is tried.
     for (const char *address : {"", "127.0.0.1"})
-        rules.push_back(format("meta l4proto %u tproxy to %s:%u ", wish.protocol, address, wish.to) +
+        rules.push_back(format_text("meta l4proto %u tproxy to %s:%u ", wish.protocol, address, wish.to) +
                         ends_as(SORTED_TO_PROXY, "to_proxy"));
     rules.push_back(ends_as(SORTED_RETURNED, "returned"));
 }
 
-// What happens to the packets of an interface that no group wants. Which group they were redirected for isn't
-// to be seen: they are forwarded or dropped only where all groups of the interface say it.
+// The rule for packets of an interface that no group wants. They don't show for which group they were
+// redirected. They are therefore forwarded or dropped only if all groups of the interface agree.
 std::string make_rest_rule(const std::vector<const sorted_group *> &groups) {
     static constexpr struct {
         leftover rest;
@@ -258,7 +262,7 @@ std::string make_rest_rule(const std::vector<const sorted_group *> &groups) {
     return rule;
 }
 
-// Groups without an intercept bring the answers of servers to what other groups intercept.
+// Groups without an intercept carry the replies of servers to flows that other groups intercept.
 void add_reply_rules(content_maker &maker, const std::vector<const sorted_group *> &groups,
                      std::vector<std::string> *out) {
     for (const sorted_group *group : groups) {
@@ -267,7 +271,7 @@ void add_reply_rules(content_maker &maker, const std::vector<const sorted_group 
             continue;
         std::string ports;
         if (!group->pass_ports.empty()) {
-            const std::string name = format("answers/%u", group->group);
+            const std::string name = format_text("answers/%u", group->group);
             nft_set &set = maker.set(name, "set { type inet_service; flags interval; }");
             taken_ports taken;
             for (const port_range &range : group->pass_ports)
@@ -280,7 +284,7 @@ void add_reply_rules(content_maker &maker, const std::vector<const sorted_group 
     }
 }
 
-// The chain for interfaces that have the same groups, named after the first of them.
+// A class is a chain for interfaces that have the same groups, named after the first of the interfaces.
 void add_class(content_maker &maker, const std::string &name,
                const std::vector<const sorted_group *> &groups) {
     std::vector<std::string> &rules = maker.rules("class/" + name);
@@ -318,21 +322,21 @@ void add_classes(content_maker &maker) {
         const auto [at, is_new] = classes.emplace(groups, name);
         if (is_new)
             add_class(maker, name, groups);
-        map.elements[quoted(name)] = "goto class/" + at->second;
+        map.elements[quote_name(name)] = "goto class/" + at->second;
     }
 }
 
 void add_arrival_chains(content_maker &maker) {
     nft_set &arrivals = maker.set("arrivals", "map { type ifname : verdict; }");
     for (const std::string &name : maker.wanted.l2_interfaces)
-        arrivals.elements[quoted(name)] = "goto arrived_l2";
+        arrivals.elements[quote_name(name)] = "goto arrived_l2";
     for (const std::string &name : maker.wanted.links)
-        arrivals.elements[quoted(name)] = "goto arrived";
+        arrivals.elements[quote_name(name)] = "goto arrived";
     for (const std::string &name : maker.wanted.members)
-        arrivals.elements[quoted(name)] = "goto arrived_member";
+        arrivals.elements[quote_name(name)] = "goto arrived_member";
     for (const std::string &name : maker.wanted.passing)
-        arrivals.elements[quoted(name)] = "goto arrived_passing";
-    // Passed on at most once: what another appliance has passed on is looked up nowhere.
+        arrivals.elements[quote_name(name)] = "goto arrived_passing";
+    // A packet is passed on at most once: one from another appliance is not looked up in the maps of slots.
     for (const auto &[chain, nobodys] :
          {std::pair{"arrived_member", "goto returned"}, std::pair{"arrived_passing", "goto passed"}})
         maker.rules(chain) = {
@@ -357,9 +361,10 @@ void add_arrival_chains(content_maker &maker) {
         "ip saddr @own_addresses goto own",
         JUST_SYN + std::string(" ip saddr . tcp sport . ip daddr . tcp dport @own_flows goto own"),
         "socket transparent 1 socket wildcard 0 goto to_proxy",
-        // What is left has no socket, one that listens, or one that isn't whole yet or any more, of which
-        // `wildcard` is undefined. A SYN for the last kind begins a new flow, and TPROXY can handle it. If
-        // it isn't wanted, it still has to be delivered here: a packet that has a socket is not forwarded.
+        // The others have no socket, a listening one (wildcard 1), or one in SYN_RECV or TIME_WAIT, for which
+        // `wildcard` matches neither value. A SYN for the last kind begins a new flow, and TPROXY handles it.
+        // If no intercept wants it, it still has to be delivered here: the kernel does not forward a packet
+        // that has a socket.
         "socket wildcard 1 goto unclaimed",
         NOT_JUST_SYN + std::string(" socket transparent 1 goto to_proxy"),
         "socket transparent 1 " + mark_as(MARK_LOCAL),
@@ -369,8 +374,9 @@ void add_arrival_chains(content_maker &maker) {
                                 "iifname vmap @classes", "goto returned"};
 }
 
-// Packets that this host sends: new flows from addresses that aren't ours are remembered, so that they are
-// known when a router redirects them, and answers in the name of a server announce a segment size that fits.
+// Packets that this host sends. New flows from foreign addresses are remembered, so that they are recognised
+// when a router redirects them back. SYN-ACKs sent in a server's name announce an MSS that fits into the
+// tunnel.
 void add_departure_chain(content_maker &maker) {
     nft_set &flows = maker.set("own_flows", "set { type ipv4_addr . inet_service . ipv4_addr . inet_service; "
                                             "flags dynamic, timeout; timeout 10s; size 65535; }");
@@ -383,14 +389,14 @@ void add_departure_chain(content_maker &maker) {
                                "update @own_flows { ip saddr . tcp sport . ip daddr . tcp dport }"),
     };
     if (maker.wanted.mss != 0)
-        chain.rules.push_back(format("tcp flags & (fin | syn | rst | ack) == (syn | ack) "
-                                     "fib saddr type != local tcp option maxseg size > %u "
-                                     "tcp option maxseg size set %u counter name \"%s\"",
-                                     maker.wanted.mss, maker.wanted.mss, CLAMPED_COUNTER));
+        chain.rules.push_back(format_text("tcp flags & (fin | syn | rst | ack) == (syn | ack) "
+                                          "fib saddr type != local tcp option maxseg size > %u "
+                                          "tcp option maxseg size set %u counter name \"%s\"",
+                                          maker.wanted.mss, maker.wanted.mss, CLAMPED_COUNTER));
 }
 
-// Packets that still have their outer headers.
-void add_outer_chains(content_maker &maker) {
+// The chain that sees GRE packets with their outer headers.
+void add_outer_chain(content_maker &maker) {
     nft_set &ends = maker.set(ENDS_SET, "set { type ipv4_addr . ipv4_addr; }");
     nft_set &locals = maker.set("local_ends", "set { type ipv4_addr; }");
     nft_set &fragments = maker.set("count_fragments", "map { type ipv4_addr . ipv4_addr : counter; }");
@@ -400,22 +406,22 @@ void add_outer_chains(content_maker &maker) {
         const std::string local = address_text(pair.local), remote = address_text(pair.remote);
         const std::string counter = "fragments/" + local + "/" + remote;
         maker.add_counter(counter);
-        fragments.elements[remote + " . " + local] = quoted(counter);
+        fragments.elements[remote + " . " + local] = quote_name(counter);
         ends.elements[remote + " . " + local] = "";
         locals.elements[local] = "";
     }
-    // Before packets are put together again, at -400.
+    // Before -400, where the kernel reassembles fragments.
     nft_chain &chain = maker.content.chains["outer"];
     chain.declaration = "type filter hook prerouting priority -450; policy accept;";
-    // GRE by its number: its name would be looked up in /etc/protocols, which not every system has.
+    // GRE by number: nftables would look up its name in /etc/protocols, which not every system has.
     chain.rules = {"ip protocol != 47 accept",
                    "ip frag-off & 0x3fff != 0 counter name ip saddr . ip daddr map @count_fragments"};
-    if (maker.wanted.drop_outer_gre) // the packet ring has them already: before they cost a route
+    if (maker.wanted.drop_outer_gre) // the packet ring has its copy: drop before the kernel looks up a route
         chain.rules.push_back("ip daddr @local_ends drop");
-    else // the user-space plane counts them itself
-        chain.rules.push_back(format("ip daddr @local_ends ip saddr . ip daddr != @%s "
-                                     "add @%s { ip saddr . ip daddr counter }",
-                                     ENDS_SET, REFUSED_SET));
+    else // only with the plane `kernel`: `user` counts refused sources itself
+        chain.rules.push_back(format_text("ip daddr @local_ends ip saddr . ip daddr != @%s "
+                                          "add @%s { ip saddr . ip daddr counter }",
+                                          ENDS_SET, REFUSED_SET));
 }
 
 bool check_sorting(const wanted_sorting &wanted, std::string *out_error) {
@@ -441,7 +447,7 @@ bool check_sorting(const wanted_sorting &wanted, std::string *out_error) {
             group.pass_marks.empty() || (slot_mask_bits(group.mask) <= 7 &&
                                          group.pass_marks.size() == size_t{1} << slot_mask_bits(group.mask));
         if (!good) {
-            *out_error = format("intercept of group %u: bad protocol, ports or prefix", group.group);
+            *out_error = format_text("intercept of group %u: bad protocol, ports or prefix", group.group);
             return false;
         }
     }
@@ -474,7 +480,7 @@ bool make_sorting_content(const wanted_sorting &wanted, nft_content *out, std::s
     add_classes(maker);
     add_arrival_chains(maker);
     add_departure_chain(maker);
-    add_outer_chains(maker);
+    add_outer_chain(maker);
     return true;
 }
 
@@ -513,7 +519,8 @@ std::map<std::string, std::string> missing_elements(const nft_set &before, const
     return missing;
 }
 
-// Elements that go, before those that come: a set is changed within the transaction, never seen in between.
+// Deletes elements before it adds new ones, whose keys may be the same. Packets see the set only as it is
+// after the transaction.
 void change_set(transaction &change, const std::string &name, const nft_set *before, const nft_set &after,
                 bool known) {
     if (after.filled_by_rules)
@@ -539,7 +546,7 @@ const V *find_in(const std::map<std::string, V> &map, const std::string &name) {
 
 } // namespace
 
-// What is referred to comes before what refers to it, and goes after it.
+// An object is added before the objects that refer to it, and deleted after them.
 std::string make_sorting_transaction(const nft_content &before, const nft_content &after) {
     if (before == after)
         return "";

@@ -16,35 +16,36 @@ struct table_link {
 };
 std::map<std::string, table_link> links;
 
-uint32_t take_index() {
+uint32_t take_table_index() {
     const uint32_t index = table_plane_next_index;
     if (index != NO_INDEX && ++table_plane_next_index == NO_INDEX)
         table_plane_next_index = 1;
     return index;
 }
 
-bool succeed(std::string *) {
+bool succeed_always(std::string *) {
     return true;
 }
 
-bool make_link(const std::string &name, const link_wish &wish, uint32_t *out_index, std::string *) {
+bool make_table_link(const std::string &name, const link_wish &wish, uint32_t *out_index, std::string *) {
     const auto known = links.find(name);
-    *out_index = known != links.end() && known->second.wish == wish ? known->second.index : take_index();
+    *out_index =
+        known != links.end() && known->second.wish == wish ? known->second.index : take_table_index();
     links[name] = {wish, *out_index};
     return true;
 }
 
-bool drop_link(const std::string &name, std::string *) {
+bool drop_table_link(const std::string &name, std::string *) {
     links.erase(name);
     return true;
 }
 
-void read_counters(plane_counters *inout) {
+void read_table_counters(plane_counters *inout) {
     for (const auto &[name, link] : links)
         inout->links[name] = {};
 }
 
 } // namespace
 
-const data_plane table_plane = {"table",   succeed,   succeed,       [] { links.clear(); },
-                                make_link, drop_link, read_counters, nullptr};
+const data_plane table_plane = {"table",         succeed_always,  succeed_always,      [] { links.clear(); },
+                                make_table_link, drop_table_link, read_table_counters, nullptr};

@@ -1,13 +1,13 @@
-// The loop of the program and what it decides.
+// The event loop of the program and its decisions.
 //
-// wccpd wakes this process by a datagram when it has put a command into the mailbox. In case one is lost the
-// mailbox is looked at four times a second as well: wccpd waits for two seconds. Without a socket for
-// wake-ups it is looked at each millisecond for a second after a command, since more follow, and less often
-// later. Everything that is due now and then is done on the same timer.
+// wccpd sends a datagram when it has put a command into the mailbox. Since a datagram can get lost and wccpd
+// waits no longer than two seconds for the answer, the mailbox is also polled four times a second. If the
+// wake-up socket could not be opened, the mailbox is polled every millisecond for a second after a command,
+// since more commands usually follow, and less often later. Periodic work is done on the same timer.
 //
-// A tunneld that is killed leaves its interfaces, routes and rules, and the next one takes them over. Until
-// it has read the configuration, however long that takes, it makes and removes tunnels as it is ordered to,
-// but sorts packets as the one before did: flows that are being served go on.
+// A killed tunneld leaves its interfaces, routes and rules, and the next one takes them over. Until that one
+// has read the configuration, however long this takes, it executes the commands that add and delete tunnels
+// but leaves the sorting rules as they are. Flows that are being served therefore go on.
 #include "peers/tunneld/tunneld.h"
 
 #include <arpa/inet.h>
@@ -42,7 +42,7 @@ namespace {
 constexpr uint32_t COMPONENT_TUNNELD = 257u << 16;
 constexpr int64_t RETRY_FIRST_MS = 1000, RETRY_MAX_MS = 30000;
 constexpr uint32_t ROLE_ACTIVE = 0;
-constexpr int64_t EARLIER_END_MS = 10000; // that an earlier tunneld may take to end
+constexpr int64_t EARLIER_END_MS = 10000; // how long the end of an earlier tunneld is waited for
 
 std::vector<uint32_t> find_own_addresses() {
     std::vector<uint32_t> out;
@@ -60,7 +60,7 @@ std::vector<uint32_t> find_own_addresses() {
     return out;
 }
 
-// --- What follows from what is known
+// --- Reconciliation of the kernel
 
 appliance_view view_appliance(const tunneld &daemon) {
     appliance_view view;
@@ -104,7 +104,7 @@ void report_failure(tunneld *daemon, const std::string &error) {
     daemon->failure = error;
 }
 
-// Interfaces come, go and change: what a tunnel's index is, only the last look at the kernel says.
+// Interfaces come and go: only the indices that the last reconciliation has found are valid.
 void note_indices(tunneld *daemon) {
     for (auto &[id, tunnel] : daemon->desk.tunnels) {
         tunnel.index = WCCP_NO_INDEX;
@@ -116,7 +116,9 @@ void note_indices(tunneld *daemon) {
     }
 }
 
-void reconcile(tunneld *daemon) {
+// Brings the kernel to the state that is wanted now. Without a change since the last call it only does so
+// when a retry or the next verification is due.
+void reconcile_now(tunneld *daemon) {
     if (daemon->plane == &table_plane)
         return;
     wanted_state wanted = make_wanted_state(view_appliance(*daemon), daemon->links,
@@ -135,8 +137,9 @@ void reconcile(tunneld *daemon) {
     note_indices(daemon);
 }
 
-// Ends the taking over once it is known how packets are to be sorted. Without a router the groups that
-// redirect by L2 are not known; a wccpd that isn't there, or has none, is not waited for long.
+// Replaces the sorting rules of the earlier tunneld once everything that the new ones need is known. Which
+// groups redirect by L2 is known only when wccpd has named their routers; if it names none, or does not run,
+// the wait ends after TAKE_OVER_WAIT_MS.
 void end_take_over(tunneld *daemon) {
     if (!daemon->takes_over || daemon->configured_ms < 0)
         return;
@@ -155,13 +158,14 @@ bool has_ends(const command_desk &desk, const tunnel_ends &ends) {
     });
 }
 
-uint16_t free_tunnel_id(const command_desk &desk, uint16_t wanted) {
+// `wanted`, or the next lower one that is free; below 0 it wraps around.
+uint16_t find_free_tunnel_id(const command_desk &desk, uint16_t wanted) {
     for (uint16_t id = wanted;; id--)
         if (!desk.tunnels.contains(id))
             return id;
 }
 
-// Of a tunnel that is deleted the link stays for a moment, with what is sent into it returned.
+// The link of a deleted tunnel stays for LINGER_MS, and its new flows are returned.
 void let_links_linger(tunneld *daemon) {
     const int64_t until_ms = lt_monotonic_ms() + LINGER_MS;
     std::erase_if(daemon->lingering,
@@ -173,15 +177,16 @@ void let_links_linger(tunneld *daemon) {
         if (daemon->active_ms >= 0 && link.wish.kind == link_kind::tunnel && !known &&
             !has_ends(daemon->desk, ends))
             daemon->lingering.push_back(
-                {{free_tunnel_id(daemon->desk, link.wish.tunnel_id), ends}, until_ms});
+                {{find_free_tunnel_id(daemon->desk, link.wish.tunnel_id), ends}, until_ms});
     }
 }
 
-// What the table of commands asks for. A look at the kernel is due even where the table is as it was.
+// Makes the tunnels of the command table.
 void apply_tunnels(tunneld *daemon) {
     let_links_linger(daemon);
-    daemon->applied.reset();
-    reconcile(daemon);
+    daemon->applied
+        .reset(); // an unchanged table too: wccpd may order a tunnel again that others have removed
+    reconcile_now(daemon);
 }
 
 // --- Health
@@ -220,7 +225,7 @@ void follow_health(tunneld *daemon) {
     }
 }
 
-// To a mgmtd that may have heard other things from the tunneld before.
+// Reports all of them to a new session. mgmtd may still have what an earlier tunneld has reported.
 void report_outages(tunneld *daemon) {
     const auto &states = health_states(daemon->health);
     for (const auto &[group, state] : states) {
@@ -244,7 +249,7 @@ void proxy_changed(tunneld *daemon, uint8_t group) {
     if (up && !daemon->outages.contains(group))
         mgmt_link_group_joins(daemon->management, group);
     follow_health(daemon);
-    reconcile(daemon);
+    reconcile_now(daemon);
 }
 
 // --- Configuration and roles
@@ -277,17 +282,17 @@ void take_configuration(tunneld *daemon, const configured_view &view) {
     health_set_checks(daemon->health, view.intercepts);
     read_roles(daemon);
     report_outages(daemon);
-    reconcile(daemon);
+    reconcile_now(daemon);
     daemon->last_command_ms = lt_monotonic_ms(); // commands may follow
 }
 
-void hear_owners(tunneld *daemon, uint8_t group, const std::string &text) {
+void take_owners_text(tunneld *daemon, uint8_t group, const std::string &text) {
     if (take_owners(&daemon->owners, group, text, daemon->configured.protection_s))
-        reconcile(daemon);
+        reconcile_now(daemon);
 }
 
-// A wccpd that has been killed leaves its roles in the mailbox, and here. Until the next one says that a
-// group is ACTIVE, only flows that there are go on.
+// The roles that a killed wccpd has reported are no longer valid. Until the next wccpd reports that a group
+// is ACTIVE, its new flows are returned and its existing flows go on.
 void forget_old_roles(tunneld *daemon) {
     const command_desk &desk = daemon->desk;
     if (desk.wccpd_lives && desk.wccpd_pid == daemon->roles_of_pid)
@@ -310,7 +315,7 @@ void note_activity(tunneld *daemon, int64_t now) {
 
 // --- The loop
 
-void tick(tunneld *daemon, int64_t now) {
+void do_periodic_work(tunneld *daemon, int64_t now) {
     watch_wccpd(&daemon->desk, now);
     forget_old_roles(daemon);
     note_activity(daemon, now);
@@ -323,7 +328,7 @@ void tick(tunneld *daemon, int64_t now) {
     follow_health(daemon);
     daemon->own_addresses = find_own_addresses();
     follow_groups(daemon);
-    reconcile(daemon);
+    reconcile_now(daemon);
     if (now >= daemon->look_at_counters_ms) {
         note_occurrences(daemon);
         daemon->look_at_counters_ms = now + OCCURRENCE_LOOK_MS;
@@ -334,19 +339,19 @@ void tick(tunneld *daemon, int64_t now) {
     }
 }
 
-void look_at_mailbox(int, short, void *data) {
+void poll_mailbox(int, short, void *data) {
     auto *daemon = static_cast<tunneld *>(data);
     const int64_t now = lt_monotonic_ms();
     bool end = false;
-    // In the order in which a command could change what the other reads.
+    // Before the command: it may come from a wccpd whose start has not been noticed yet.
     if (now >= daemon->tick_at_ms) {
         daemon->tick_at_ms = now + TICK_MS;
-        tick(daemon, now);
+        do_periodic_work(daemon, now);
     }
     if (take_command(&daemon->desk, &end)) {
         daemon->last_command_ms = now;
         if (daemon->management)
-            mgmt_link_ask_routers(daemon->management); // a new tunnel may mean a new router
+            mgmt_link_ask_routers(daemon->management); // a new tunnel can belong to a new router
     }
     if (daemon->end_at_ms >= 0 && now >= daemon->end_at_ms)
         LOG_STATUS(lew_escape_from_dispatch(daemon->loop));
@@ -355,19 +360,19 @@ void look_at_mailbox(int, short, void *data) {
     LOG_STATUS(loop_event_set_timer(daemon->mailbox_timer, pause));
 }
 
-// The wake-up is taken first: one that comes during the look means another.
-void be_woken(int fd, short, void *data) {
+// The datagrams are read before the mailbox: one that arrives afterwards causes another call.
+void take_wake_up(int fd, short, void *data) {
     take_wake_ups(fd);
-    look_at_mailbox(-1, 0, data);
+    poll_mailbox(-1, 0, data);
 }
 
-// When the program may end. After wccpd has left its routers they go on sending for a moment, and what they
-// send is returned. One that still runs has left none, and has to see that tunneld is gone.
-int64_t find_end(tunneld *daemon, int64_t now) {
+// When the program may end. After wccpd has left its routers they still send for a moment, and their packets
+// are returned. A wccpd that still runs has left no router: it has to notice at once that tunneld ends.
+int64_t find_end_time(tunneld *daemon, int64_t now) {
     watch_wccpd(&daemon->desk, now);
     if (daemon->plane == &table_plane || daemon->active_ms < 0 || daemon->desk.wccpd_lives)
         return now;
-    int64_t end = daemon->active_ms + TICK_MS + LINGER_MS; // it is noted once a tick
+    int64_t end = daemon->active_ms + TICK_MS + LINGER_MS; // `active_ms` is up to a tick old
     for (const lingering_link &each : daemon->lingering)
         end = std::max(end, each.until_ms);
     return end;
@@ -375,20 +380,20 @@ int64_t find_end(tunneld *daemon, int64_t now) {
 
 lc_status take_signal(int number, short, void *data, lew *loop) {
     auto *daemon = static_cast<tunneld *>(data);
-    const int64_t now = lt_monotonic_ms(), end = find_end(daemon, now);
+    const int64_t now = lt_monotonic_ms(), end = find_end_time(daemon, now);
     LC_LOG(LC_LOG_INFO, "Received %s", lc_signal_num_to_name(number));
     if (daemon->end_at_ms >= 0 || end <= now)
         return lew_escape_from_dispatch(loop);
-    LC_LOG(LC_LOG_NOTICE, "Routers may still send: what comes is returned for %lld ms more",
+    LC_LOG(LC_LOG_NOTICE, "Routers may still send: their packets are returned for %lld ms",
            static_cast<long long>(end - now));
     daemon->end_at_ms = end;
-    reconcile(daemon);
+    reconcile_now(daemon);
     return LC_OK;
 }
 
 // --- Start and end
 
-// What a data plane needs and this process lacks, or "".
+// The privileges that data planes need and this process lacks, or "".
 std::string missing_privileges() {
     static const struct {
         int capability;
@@ -429,9 +434,9 @@ bool choose_plane(tunneld *daemon) {
     return true;
 }
 
-// Takes over what a killed tunneld has left. Of two tunnels with one id the one that was made last is kept:
-// the other was being replaced.
-void take_over(tunneld *daemon) {
+// Takes over what a killed tunneld has left. Of two links with the same tunnel id the later one counts: it
+// was replacing the other.
+void take_over_kernel_state(tunneld *daemon) {
     daemon->owners = load_owners();
     daemon->links = find_own_links();
     daemon->takes_over = !daemon->links.empty() || is_kernel_state_left();
@@ -445,7 +450,7 @@ void take_over(tunneld *daemon) {
             link.wish.kind == link_kind::accepted && beside != daemon->desk.tunnels.end())
             daemon->configured.accepted.push_back({link.wish.remote, beside->second.remote});
     LC_LOG(LC_LOG_NOTICE, "%zu tunnels are taken over", daemon->desk.tunnels.size());
-    reconcile(daemon);
+    reconcile_now(daemon);
     if (daemon->plane->set_passing)
         daemon->plane->set_passing(load_passing());
 }
@@ -457,19 +462,19 @@ void start_plane(tunneld *daemon) {
     daemon->desk.apply = [daemon](std::map<uint16_t, command_tunnel> *) { apply_tunnels(daemon); };
     daemon->desk.set_l2_return = [daemon](uint8_t group, bool forced) {
         daemon->forced_l2[group] = forced;
-        reconcile(daemon);
+        reconcile_now(daemon);
     };
-    take_over(daemon);
+    take_over_kernel_state(daemon);
 }
 
 bool start_parts(tunneld *daemon) {
     loop_context *context = nullptr;
     if (lew_init(&daemon->loop) != LC_OK || lew_get_event_context(daemon->loop, &context) != LC_OK ||
-        loop_event_new(context, look_at_mailbox, daemon, &daemon->mailbox_timer) != LC_OK)
+        loop_event_new(context, poll_mailbox, daemon, &daemon->mailbox_timer) != LC_OK)
         return false;
     daemon->wake_up = open_wake_up();
     if (daemon->wake_up >= 0 &&
-        (loop_event_new(context, be_woken, daemon, &daemon->wake_up_event) != LC_OK ||
+        (loop_event_new(context, take_wake_up, daemon, &daemon->wake_up_event) != LC_OK ||
          loop_event_set_fd(daemon->wake_up_event, daemon->wake_up, LOOP_READ) != LC_OK))
         return false;
     static lew_event *slots[3];
@@ -480,24 +485,23 @@ bool start_parts(tunneld *daemon) {
     if (!start_commands(&daemon->desk, daemon->options.commands, stdout) || !choose_plane(daemon))
         return false;
     daemon->health = health_new(context, [daemon](uint8_t group) { proxy_changed(daemon, group); });
-    if (!daemon->health)
-        return false;
     if (daemon->plane != &table_plane)
         start_plane(daemon);
-    if (daemon->options.commands.silent) // like a program that hangs
+    if (daemon->options.commands.silent) // for tests: a program that hangs has no session either
         return true;
     daemon->management = mgmt_link_new(
         daemon->loop,
         {[daemon](const configured_view &view) { take_configuration(daemon, view); },
          [daemon] { return tunneld_state(daemon); },
-         [daemon](uint8_t group, const std::string &text) { hear_owners(daemon, group, text); }});
+         [daemon](uint8_t group, const std::string &text) { take_owners_text(daemon, group, text); }});
     return daemon->management != nullptr;
 }
 
-// Of two tunnelds the one that ends would remove what the other has taken over. One that is killed lets go at
-// once; one that ends in order, as after the loss of its mgmtd, takes a moment. A system that has no room for
-// the lock is not a reason to carry nothing.
-bool take_lock(int *out_fd) {
+// If two tunnelds ran, the one that ends would remove what the other has taken over. A killed tunneld
+// releases the lock at once, one that ends in order, for example after the loss of its mgmtd, a moment later.
+// False when another one still runs. A lock file that cannot be made is only logged: packets are carried all
+// the same.
+bool take_process_lock(int *out_fd) {
     (void)mkdir("/run/tunneld", 0755);
     *out_fd = open("/run/tunneld/lock", O_RDWR | O_CREAT | O_CLOEXEC, 0644);
     if (*out_fd < 0) {
@@ -524,7 +528,7 @@ void end_parts(tunneld *daemon) {
     if (daemon->plane && daemon->plane != &table_plane && !remove_kernel_state(*daemon->plane, &error))
         LC_LOG(LC_LOG_ERR, "Not everything could be removed from the kernel: %s", error.c_str());
     if (daemon->management)
-        mgmt_link_ends(daemon->management); // the next one has nothing to take over
+        mgmt_link_ends(daemon->management); // nothing is left for the next tunneld to take over
     if (daemon->plane) {
         forget_wccpd();
         daemon->plane->close();
@@ -544,8 +548,8 @@ void end_parts(tunneld *daemon) {
 
 } // namespace
 
-// Before its first check a proxy counts as up, as it was under the tunneld before; a gateway that fails
-// closed takes no chances.
+// Before its first check a proxy counts as up, so that a restart of tunneld interrupts nothing. With `down
+// drop` it counts as down: no packet may get past the proxy there.
 bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules) {
     const auto &states = health_states(daemon.health);
     const auto found = states.find(group);
@@ -557,7 +561,7 @@ bool is_proxy_up(const tunneld &daemon, uint8_t group, const intercept &rules) {
 bool is_active_group(const tunneld &daemon, uint8_t group) {
     const auto found = daemon.configured.groups.find(group);
     if (found == daemon.configured.groups.end())
-        return true; // it takes no part
+        return true; // not configured: there is no role to wait for
     if (!found->second.active || !daemon.desk.wccpd_lives || daemon.end_at_ms >= 0)
         return false;
     if (found->second.policy_group == 0)
@@ -566,7 +570,7 @@ bool is_active_group(const tunneld &daemon, uint8_t group) {
     return role != daemon.roles.end() && role->second;
 }
 
-// Until a packet has come, what routers send is taken to have a redirect header, as by far the most have.
+// Until the first packet has come, routers are assumed to send redirect headers, as most of them do.
 std::map<uint8_t, group_cover> protection_cover(const tunneld &daemon, const plane_counters &plane) {
     uint64_t packets = 0, headers = 0;
     for (const wanted_link &link : daemon.links)
@@ -590,10 +594,10 @@ int run_tunneld(const tunneld_options &options) {
     daemon.options = options;
     daemon.desk.options = options.commands;
     daemon.last_command_ms = lt_monotonic_ms();
-    bool good = take_lock(&lock) && start_parts(&daemon);
+    bool good = take_process_lock(&lock) && start_parts(&daemon);
     if (good) {
         service_report("READY=1");
-        look_at_mailbox(-1, 0, &daemon);
+        poll_mailbox(-1, 0, &daemon);
         good = lew_dispatch(daemon.loop, nullptr, nullptr) == LC_OK;
         service_report("STOPPING=1");
     }

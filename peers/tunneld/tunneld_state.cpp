@@ -1,4 +1,4 @@
-// The state nodes that tunneld answers for.
+// Makes the state nodes of tunneld.
 #include <algorithm>
 
 #include "mgmt/bnode_types.h"
@@ -17,19 +17,21 @@ struct node_writer {
     void add(const std::string &name, uint32_t type, const std::string &text) {
         out->push_back({above + "/" + name, type, text});
     }
-    void count(const std::string &name, uint64_t value) { add(name, bn_type_uint64, std::to_string(value)); }
+    void add_count(const std::string &name, uint64_t value) {
+        add(name, bn_type_uint64, std::to_string(value));
+    }
 };
 
 void add_sorted(node_writer *writer, const packet_count *ways) {
     for (size_t way = 0; way < SORTED_WAYS; way++) {
-        writer->count(sorted_words[way], ways[way].packets);
-        writer->count(std::string(sorted_words[way]) + "_bytes", ways[way].bytes);
+        writer->add_count(sorted_words[way], ways[way].packets);
+        writer->add_count(std::string(sorted_words[way]) + "_bytes", ways[way].bytes);
     }
 }
 
 void add_refused(node_writer *writer, const uint64_t *refused) {
     for (size_t reason = 0; reason < REFUSALS; reason++)
-        writer->count(std::string("refused/") + refusal_words[reason], refused[reason]);
+        writer->add_count(std::string("refused/") + refusal_words[reason], refused[reason]);
 }
 
 void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorting_counters &sorting,
@@ -48,7 +50,7 @@ void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorti
         writer.add("remote", bn_type_ipv4addr, address_text(link.wish.remote));
         writer.add("interface", bn_type_str, link.name);
         writer.add("index", bn_type_uint32, std::to_string(index->second));
-        // Packets of its further sources count with the tunnel that they are accepted beside.
+        // The packets of an accepted source count with its tunnel.
         link_counters sum;
         packet_count ways[SORTED_WAYS];
         uint64_t fragments = 0;
@@ -72,11 +74,11 @@ void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorti
                 found != sorting.fragments.end())
                 fragments += found->second;
         }
-        writer.count("packets_in", sum.packets_in);
-        writer.count("bytes_in", sum.bytes_in);
-        writer.count("packets_out", sum.packets_out);
-        writer.count("bytes_out", sum.bytes_out);
-        writer.count("fragments", fragments);
+        writer.add_count("packets_in", sum.packets_in);
+        writer.add_count("bytes_in", sum.bytes_in);
+        writer.add_count("packets_out", sum.packets_out);
+        writer.add_count("bytes_out", sum.bytes_out);
+        writer.add_count("fragments", fragments);
         add_refused(&writer, sum.refused);
         add_sorted(&writer, ways);
     }
@@ -98,13 +100,13 @@ void add_intercepts(const tunneld &daemon, const sorting_counters &sorting, std:
         const bool known = state != states.end();
         writer.add("proxy", bn_type_str, words[known ? state->second.state : proxy_health::unknown]);
         writer.add("proxy_reason", bn_type_str, known ? state->second.reason : "");
-        writer.count("proxy_ms", known ? static_cast<uint64_t>(now - state->second.since_ms) : 0);
+        writer.add_count("proxy_ms", known ? static_cast<uint64_t>(now - state->second.since_ms) : 0);
         writer.add("active", bn_type_bool, is_active_group(daemon, group) ? "true" : "false");
         const auto outage = daemon.outages.find(group);
         writer.add("left", bn_type_bool,
                    outage != daemon.outages.end() && outage->second.left ? "true" : "false");
         if (const auto count = counts.find(group); counted && count != counts.end())
-            writer.count("flows", count->second);
+            writer.add_count("flows", count->second);
         const auto followed = daemon.followed.find(group);
         const course_decision decided =
             followed == daemon.followed.end() ? course_decision{} : followed->second.decided;
@@ -116,7 +118,7 @@ void add_intercepts(const tunneld &daemon, const sorting_counters &sorting, std:
     }
 }
 
-// What has been exchanged with one other appliance.
+// The packets exchanged with another appliance.
 struct member_counts {
     std::string interface;
     uint64_t passed = 0, received = 0, delivered = 0, returned = 0;
@@ -152,10 +154,10 @@ void add_protection(const tunneld &daemon, const plane_counters &plane, const so
         sum.returned += counts.returned;
     }
     const auto add_counts = [](node_writer *writer, const member_counts &counts) {
-        writer->count("passed", counts.passed);
-        writer->count("received", counts.received);
-        writer->count("delivered", counts.delivered);
-        writer->count("returned", counts.returned);
+        writer->add_count("passed", counts.passed);
+        writer->add_count("received", counts.received);
+        writer->add_count("delivered", counts.delivered);
+        writer->add_count("returned", counts.returned);
     };
     node_writer writer = {out, NODE_PROTECTION_STATE};
     writer.add("time", bn_type_uint32, std::to_string(daemon.configured.protection_s));
@@ -179,9 +181,9 @@ void add_protection(const tunneld &daemon, const plane_counters &plane, const so
 void add_occurrences(const occurrences &occurred, node_writer *writer) {
     const int64_t now = lt_monotonic_ms();
     for (const auto &[what, when] : occurred) {
-        writer->count("first_ms/" + what, static_cast<uint64_t>(now - when.first_ms));
+        writer->add_count("first_ms/" + what, static_cast<uint64_t>(now - when.first_ms));
         if (when.last_ms >= 0)
-            writer->count("last_ms/" + what, static_cast<uint64_t>(now - when.last_ms));
+            writer->add_count("last_ms/" + what, static_cast<uint64_t>(now - when.last_ms));
     }
 }
 
@@ -237,13 +239,13 @@ std::vector<state_node> tunneld_state(tunneld *daemon_now) {
     uint64_t own = 0;
     for (const auto &[name, ways] : sorting.interfaces)
         own += ways[SORTED_OWN].packets;
-    writer.count("own", own);
-    writer.count("clamped", sorting.clamped);
+    writer.add_count("own", own);
+    writer.add_count("clamped", sorting.clamped);
     add_refused(&writer, plane.refused);
     std::map<uint32_t, uint64_t> sources = plane.refused_sources;
     sources.insert(sorting.refused_sources.begin(), sorting.refused_sources.end());
     for (const auto &[address, packets] : sources)
-        writer.count("refused_source/" + address_text(address), packets);
+        writer.add_count("refused_source/" + address_text(address), packets);
     add_occurrences(daemon.occurred, &writer);
 
     add_tunnels(daemon, plane, sorting, &out);

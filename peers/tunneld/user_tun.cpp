@@ -15,16 +15,16 @@
 namespace {
 
 constexpr const char *TUN_PATH = "/dev/net/tun";
-// Large UDP packets, newer than the headers of this system. The kernel takes both or neither.
+// TUN_F_USO4 and TUN_F_USO6, newer than the headers of this system. The kernel takes both or neither.
 constexpr unsigned TUN_LARGE_UDP = 0x20 | 0x40;
 
-bool fail(std::string *out_error, const std::string &what) {
+bool fail_tun(std::string *out_error, const std::string &what) {
     *out_error = what + ": " + strerror(errno);
     return false;
 }
 
-// A process that has just ended, or a thread that polls, may hold the device for a moment yet.
-bool attach(int fd, ifreq *request) {
+// After a process has ended, the kernel can hold its device for a moment.
+bool attach_device(int fd, ifreq *request) {
     for (int tries = 0; tries < 20; tries++) {
         if (ioctl(fd, TUNSETIFF, request) == 0)
             return true;
@@ -39,23 +39,23 @@ bool set_up_device(int fd, const std::string &name, tun_device *out, std::string
     ifreq request = {};
     if (name.size() >= sizeof request.ifr_name) {
         errno = ENAMETOOLONG;
-        return fail(out_error, name);
+        return fail_tun(out_error, name);
     }
     memcpy(request.ifr_name, name.c_str(), name.size() + 1);
     request.ifr_flags = IFF_TUN | IFF_NO_PI | IFF_VNET_HDR;
-    if (!attach(fd, &request))
-        return fail(out_error, "TUN device " + name);
+    if (!attach_device(fd, &request))
+        return fail_tun(out_error, "TUN device " + name);
     int header = sizeof(virtio_header);
     if (ioctl(fd, TUNSETVNETHDRSZ, &header) != 0)
-        return fail(out_error, name + ": virtio header");
+        return fail_tun(out_error, name + ": virtio header");
     constexpr unsigned offloads = TUN_F_CSUM | TUN_F_TSO4 | TUN_F_TSO_ECN;
     out->takes_large_udp = ioctl(fd, TUNSETOFFLOAD, offloads | TUN_LARGE_UDP) == 0;
     if (!out->takes_large_udp && ioctl(fd, TUNSETOFFLOAD, offloads) != 0)
-        return fail(out_error, name + ": offloads");
+        return fail_tun(out_error, name + ": offloads");
     if (ioctl(fd, TUNSETPERSIST, 1) != 0)
-        return fail(out_error, name + ": persistence");
+        return fail_tun(out_error, name + ": persistence");
     out->index = if_nametoindex(name.c_str());
-    return out->index != 0 || fail(out_error, name);
+    return out->index != 0 || fail_tun(out_error, name);
 }
 
 } // namespace
@@ -63,7 +63,7 @@ bool set_up_device(int fd, const std::string &name, tun_device *out, std::string
 bool tun_probe(std::string *out_why_not) {
     const int fd = open(TUN_PATH, O_RDWR | O_CLOEXEC);
     if (fd < 0)
-        return fail(out_why_not, TUN_PATH);
+        return fail_tun(out_why_not, TUN_PATH);
     unsigned features = 0;
     const bool known = ioctl(fd, TUNGETFEATURES, &features) == 0 && (features & IFF_VNET_HDR);
     close(fd);
@@ -76,7 +76,7 @@ bool tun_open(const std::string &name, tun_device *out, std::string *out_error) 
     *out = {};
     const int fd = open(TUN_PATH, O_RDWR | O_NONBLOCK | O_CLOEXEC);
     if (fd < 0)
-        return fail(out_error, TUN_PATH);
+        return fail_tun(out_error, TUN_PATH);
     if (!set_up_device(fd, name, out, out_error)) {
         close(fd);
         return false;

@@ -1,9 +1,8 @@
-// From what is known to what the kernel should hold. Nothing here looks at the kernel or changes it.
+// Computes the wanted state of the kernel. Nothing here reads or changes the kernel.
 //
-// Rules, by preference: marked packets of our interfaces are delivered here, then routed by the main table,
-// then given back from L2 through a link; whatever else comes out of a link goes back into it. A lookup that
-// finds nothing goes on to the next rule and ends in the main table: nothing is lost where a route is
-// missing.
+// The preferences of the rules order them: marked packets are delivered locally, or routed by the main table,
+// or returned or passed on through a link; every other packet that came out of a link goes back into it. A
+// rule whose table has no route is skipped, and the main table comes last: a missing route loses no packets.
 
 #include "peers/tunneld/wanted_state.h"
 
@@ -20,15 +19,15 @@ namespace {
 
 constexpr uint32_t PREFER_LOCAL = RULE_PREFERENCE, PREFER_FORWARD = RULE_PREFERENCE + 1,
                    PREFER_RETURN = RULE_PREFERENCE + 2, PREFER_LINK = RULE_PREFERENCE + 3;
-// What TCP carries at most in a packet that has to fit into GRE with its redirect header: 1500 less 20 for
-// the outer header, 4 for GRE and 4 for the redirect header, less 40 for the headers of IP and TCP.
+// The largest TCP segment that fits into a GRE packet of 1500 bytes: without 28 bytes for the outer IP
+// header, the GRE header and the redirect header, and 40 for the inner headers of IP and TCP.
 constexpr uint16_t TUNNEL_MSS = 1500 - 28 - 40;
 
 struct name_value {
     const char *name, *value;
 };
-// With all routes by a link that is down ignored, packets for a TUN device whose program is gone are routed
-// by the main table and not lost.
+// ignore_routes_with_linkdown: when the program that holds a TUN device is gone, the link is down, and
+// packets are routed by the main table instead of being lost.
 constexpr name_value LINK_SETTINGS[] = {{"rp_filter", "0"},
                                         {"accept_local", "1"},
                                         {"send_redirects", "0"},
@@ -42,11 +41,12 @@ struct link_numbers {
     numbers_by_ends carrying, passing;
 };
 
-bool stands_beside(const accepted_source &source, const tunnel_ends &tunnel) {
+// Whether packets of the accepted source are treated like those of this tunnel.
+bool is_accepted_beside(const accepted_source &source, const tunnel_ends &tunnel) {
     return !source.router || source.router == tunnel.remote;
 }
 
-// Those that are there, and after them those that go.
+// The ordered tunnels, followed by the deleted ones that linger.
 std::vector<lingering_tunnel> all_tunnels(const appliance_view &view) {
     std::vector<lingering_tunnel> out;
     for (const auto &[id, ends] : view.tunnels)
@@ -59,7 +59,8 @@ numbers_by_ends &numbers_of(link_numbers *numbers, const link_wish &wish) {
     return wish.kind == link_kind::passing ? numbers->passing : numbers->carrying;
 }
 
-// Known ends keep their number. The number of a link that goes is free only once it has gone.
+// Links that exist keep their numbers. The number of a link that is removed can be used again only the next
+// time, when it is no longer in `before`.
 link_numbers number_links(const std::vector<link_wish> &wishes, const std::vector<wanted_link> &before) {
     link_numbers old, numbers;
     std::set<uint32_t> used;
@@ -109,9 +110,9 @@ bool is_tunnel(const appliance_view &view, const tunnel_ends &ends) {
                        [&](const lingering_tunnel &each) { return each.ends == ends; });
 }
 
-// The ends of links to other appliances: of groups whose packets come here, while something is intercepted.
-// One that is a router as well is none. What such links bring is never passed on; therefore they come before
-// sources that are accepted as if they were routers.
+// The ends of the links to other appliances, of groups whose packets come here. There are none while nothing
+// is intercepted, and none to an address to which there is a tunnel. Packets from a member must never be
+// passed on again: if an address is also an accepted source, the member's link wins.
 std::set<tunnel_ends> member_ends(const appliance_view &view) {
     std::set<tunnel_ends> all;
     for (const auto &[id, protection] : view.protections) {
@@ -126,7 +127,7 @@ std::set<tunnel_ends> member_ends(const appliance_view &view) {
     return all;
 }
 
-// Buckets are seen by the user-space plane alone, in what comes through tunnels.
+// The links of kind `passing`: only the plane `user` sees buckets, and only in GRE.
 std::set<tunnel_ends> passing_ends(const appliance_view &view) {
     std::set<tunnel_ends> all;
     const std::set<tunnel_ends> members = member_ends(view);
@@ -148,7 +149,7 @@ std::vector<link_wish> wish_links(const appliance_view &view, bool user_space) {
             wishes.push_back({id, ends.local, ends.remote, link_kind::tunnel});
     for (const auto &source : view.accepted)
         for (const auto &[id, ends] : tunnels)
-            if (source.address && stands_beside(source, ends) &&
+            if (source.address && is_accepted_beside(source, ends) &&
                 taken.insert({ends.local, source.address}).second)
                 wishes.push_back({id, ends.local, source.address, link_kind::accepted});
     for (const tunnel_ends &ends : member_ends(view))
@@ -159,8 +160,8 @@ std::vector<link_wish> wish_links(const appliance_view &view, bool user_space) {
     return wishes;
 }
 
-// Those that an earlier tunneld has left.
-void keep_members(const std::vector<wanted_link> &left, std::vector<link_wish> *inout) {
+// Adds the links to members that an earlier tunneld has left.
+void keep_member_links(const std::vector<wanted_link> &left, std::vector<link_wish> *inout) {
     for (const wanted_link &link : left)
         if ((link.wish.kind == link_kind::member || link.wish.kind == link_kind::passing) &&
             std::none_of(inout->begin(), inout->end(), [&](const link_wish &wish) {
@@ -170,7 +171,7 @@ void keep_members(const std::vector<wanted_link> &left, std::vector<link_wish> *
             inout->push_back(link.wish);
 }
 
-// The ends of a group's links and, for each, the tunnel that they stand beside or are.
+// The ends of a group's links; for each the tunnel, which differs from it for an accepted source.
 std::map<tunnel_ends, tunnel_ends> group_links(const appliance_view &view, const group_view &group,
                                                const std::vector<lingering_tunnel> &tunnels) {
     std::map<tunnel_ends, tunnel_ends> links;
@@ -180,7 +181,7 @@ std::map<tunnel_ends, tunnel_ends> group_links(const appliance_view &view, const
             continue;
         links[tunnel] = tunnel;
         for (const auto &source : view.accepted)
-            if (source.address && stands_beside(source, tunnel) &&
+            if (source.address && is_accepted_beside(source, tunnel) &&
                 !members.contains({tunnel.local, source.address}))
                 links.insert({{tunnel.local, source.address}, tunnel});
     }
@@ -191,8 +192,8 @@ struct next_hop {
     std::string interface;
     uint32_t via;
 };
-// Where a link's packets are given back to by L2. Groups share a link: one that forces L2 decides; otherwise
-// all of its groups have to have agreed on L2 with the router, since GRE is always understood.
+// Where a link's packets are returned by L2. Groups can share a link. One that forces L2 decides for all of
+// them. Otherwise all of them must have negotiated L2 with the router, since every router accepts GRE.
 struct l2_choice {
     std::optional<next_hop> forced, agreed;
     bool gre = false;
@@ -213,7 +214,7 @@ void choose_return(const group_view &group, uint32_t router_id, l2_choice *choic
     }
 }
 
-// What is not to be delivered here goes where `table` says.
+// Packets without a mark are routed by `table`.
 void want_link_basics(const wanted_link &link, uint32_t table, wanted_state *out) {
     out->rules.push_back({PREFER_LOCAL, link.name, MARK_LOCAL, TABLE_LOCAL});
     out->rules.push_back({PREFER_LINK, link.name, 0, table});
@@ -237,8 +238,9 @@ void want_link(const wanted_link &link, uint32_t number, const l2_choice &choice
     out->sorting.mss = TUNNEL_MSS;
 }
 
-// The link that packets go back through which the router has redirected by L2, if that is what it wants.
-std::optional<uint32_t> l2_return_link(const group_view &group, const link_numbers &numbers) {
+// The number of the link through which packets are returned that a router redirects by L2 and wants back by
+// GRE.
+std::optional<uint32_t> find_l2_return_link(const group_view &group, const link_numbers &numbers) {
     if (group.force_l2_return)
         return std::nullopt;
     for (const auto &router : group.routers)
@@ -250,13 +252,13 @@ std::optional<uint32_t> l2_return_link(const group_view &group, const link_numbe
 }
 
 void want_l2_interfaces(const appliance_view &view, const link_numbers &numbers, wanted_state *out) {
-    std::map<std::string, std::optional<uint32_t>> interfaces; // with the number of the link to return by
+    std::map<std::string, std::optional<uint32_t>> interfaces; // and the link through which to return packets
     for (const auto &[id, group] : view.groups) {
         if (!redirects_by_l2(group))
             continue;
         auto &link = interfaces[group.interface];
         if (!link)
-            link = l2_return_link(group, numbers);
+            link = find_l2_return_link(group, numbers);
     }
     for (const auto &[name, link] : interfaces) {
         out->sorting.l2_interfaces.push_back(name);
@@ -270,11 +272,11 @@ void want_l2_interfaces(const appliance_view &view, const link_numbers &numbers,
     }
 }
 
-// The interfaces that a group's packets come in by.
+// The interfaces at which a group's packets arrive.
 std::vector<std::string> group_interfaces(const appliance_view &view, const group_view &group,
                                           const link_numbers &numbers) {
     std::vector<std::string> names;
-    std::vector<lingering_tunnel> tunnels; // the others belong to no group: what comes there is returned
+    std::vector<lingering_tunnel> tunnels; // without lingering ones, which have no group: all is returned
     for (const auto &[id, ends] : view.tunnels)
         tunnels.push_back({id, ends});
     for (const auto &[ends, tunnel] : group_links(view, group, tunnels))
@@ -284,10 +286,11 @@ std::vector<std::string> group_interfaces(const appliance_view &view, const grou
     return names;
 }
 
-// The ports of TCP whose flows are protected in a group: those of its intercept or, where it has none, as the
-// ports of the sender those of all intercepts. False: nothing is. None: all ports.
-bool protected_ports(const appliance_view &view, uint8_t id, bool *out_by_source,
-                     std::vector<port_range> *out) {
+// The TCP ports whose flows are protected in a group: the ports of its intercept. A group without an
+// intercept carries the replies of servers: there it is the source ports, those of all intercepts. Empty: all
+// ports. False: no TCP flow is protected.
+bool find_protected_ports(const appliance_view &view, uint8_t id, bool *out_by_source,
+                          std::vector<port_range> *out) {
     const auto own = view.intercepts.find(id);
     *out_by_source = own == view.intercepts.end();
     bool any = false, all = false;
@@ -303,12 +306,12 @@ bool protected_ports(const appliance_view &view, uint8_t id, bool *out_by_source
     return any;
 }
 
-// By mask; only where a slot is somebody's.
+// With mask assignment, the rules pass packets on.
 void want_pass_marks(const appliance_view &view, const link_numbers &numbers, sorted_group *inout) {
     const auto protection = view.protections.find(inout->group);
     bool by_source = false;
     if (protection == view.protections.end() || !protection->second.by_mask ||
-        !protected_ports(view, inout->group, &by_source, &inout->pass_ports))
+        !find_protected_ports(view, inout->group, &by_source, &inout->pass_ports))
         return;
     const std::set<tunnel_ends> members = member_ends(view);
     const uint32_t local = view.groups.at(inout->group).local;
@@ -318,8 +321,8 @@ void want_pass_marks(const appliance_view &view, const link_numbers &numbers, so
             members.contains({local, target}) ? MARK_PASS + numbers.carrying.at({local, target}) : 0);
 }
 
-// Groups with an intercept, and those that share an interface with one: without a wish of their own, they
-// keep their packets from being dropped or forwarded for another group.
+// Groups with an intercept, groups without one that pass packets on, and those that share an interface with
+// an intercept: see sorted_group.
 void want_groups(const appliance_view &view, const link_numbers &numbers, std::vector<sorted_group> *out) {
     std::map<uint8_t, std::vector<std::string>> others;
     std::set<std::string> intercepted;
@@ -348,9 +351,10 @@ void want_groups(const appliance_view &view, const link_numbers &numbers, std::v
     }
 }
 
-// Packets of other appliances that nobody here wants go back to a router of a group that has both.
-std::optional<wanted_route> member_return(const appliance_view &view, const link_numbers &numbers,
-                                          const tunnel_ends &member, const wanted_state &made) {
+// The way of packets that a member has passed on and that have no socket here: to a router of a group that
+// this appliance and the member belong to.
+std::optional<wanted_route> find_member_return(const appliance_view &view, const link_numbers &numbers,
+                                               const tunnel_ends &member, const wanted_state &made) {
     const auto route_of = [&](uint32_t number) -> std::optional<wanted_route> {
         for (const wanted_route &route : made.routes)
             if (route.table == TABLE_LINK_FIRST + number)
@@ -363,7 +367,7 @@ std::optional<wanted_route> member_return(const appliance_view &view, const link
             std::find(protection.members.begin(), protection.members.end(), member.remote) ==
                 protection.members.end())
             continue;
-        if (const auto number = l2_return_link(group->second, numbers))
+        if (const auto number = find_l2_return_link(group->second, numbers))
             return route_of(*number);
         for (const auto &router : group->second.routers)
             if (router.forward == travel::l2 && router.address && is_interface_name(group->second.interface))
@@ -393,7 +397,7 @@ void want_members(const appliance_view &view, const link_numbers &numbers, wante
         want_link_basics(link, TABLE_LINK_FIRST + number->second, out);
         out->rules.push_back({PREFER_RETURN, "", MARK_PASS + number->second, table});
         out->routes.push_back({table, false, link.name, 0});
-        if (auto route = member_return(view, numbers, ends, *out)) {
+        if (auto route = find_member_return(view, numbers, ends, *out)) {
             route->table = TABLE_LINK_FIRST + number->second;
             out->routes.push_back(*route);
         }
@@ -402,8 +406,7 @@ void want_members(const appliance_view &view, const link_numbers &numbers, wante
     }
 }
 
-// What the user-space plane passes on: of groups with an intercept what that wants, and of the others, whose
-// packets go the other way, what comes from there.
+// With hash assignment, the plane `user` passes packets on.
 void want_passing(const appliance_view &view, const link_numbers &numbers, wanted_state *out) {
     for (const auto &[id, protection] : view.protections) {
         const auto group = view.groups.find(id);
@@ -411,7 +414,7 @@ void want_passing(const appliance_view &view, const link_numbers &numbers, wante
             continue;
         passing_group made;
         made.local = group->second.local;
-        if (!protected_ports(view, id, &made.by_source_port, &made.ports))
+        if (!find_protected_ports(view, id, &made.by_source_port, &made.ports))
             continue;
         for (const uint32_t target : protection.targets)
             made.members.push_back(numbers.passing.contains({made.local, target}) ? target : 0);
@@ -423,11 +426,11 @@ void want_passing(const appliance_view &view, const link_numbers &numbers, wante
 } // namespace
 
 wanted_state make_wanted_state(const appliance_view &view, const std::vector<wanted_link> &before,
-                               bool user_space, bool kept) {
+                               bool user_space, bool keep_members) {
     wanted_state wanted;
     auto wishes = wish_links(view, user_space);
-    if (kept)
-        keep_members(before, &wishes);
+    if (keep_members)
+        keep_member_links(before, &wishes);
     link_numbers numbers = number_links(wishes, before);
     std::map<tunnel_ends, l2_choice> choices;
     for (const auto &[id, group] : view.groups)
@@ -445,8 +448,8 @@ wanted_state make_wanted_state(const appliance_view &view, const std::vector<wan
     want_l2_interfaces(view, numbers, &wanted);
     if (!wanted.rules.empty()) {
         wanted.routes.insert(wanted.routes.begin(), {TABLE_LOCAL, true, "", 0});
-        // The larger of the interface's value and this one counts for the first, either of them for the
-        // second.
+        // For rp_filter the larger of the interface's value and that of `all` counts, and redirects are sent
+        // if either of the two allows them.
         if (!wanted.links.empty())
             wanted.settings.push_back({"all/rp_filter", "0", true});
         wanted.settings.push_back({"all/send_redirects", "0", true});
