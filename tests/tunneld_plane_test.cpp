@@ -28,6 +28,7 @@
 #include "peers/tunneld/coalesce.h"
 #include "peers/tunneld/gre.h"
 #include "peers/tunneld/kernel_state.h"
+#include "peers/tunneld/netlink.h"
 #include "peers/tunneld/passing.h"
 #include "peers/tunneld/plane.h"
 #include "peers/tunneld/wanted_state.h"
@@ -107,6 +108,21 @@ bytes wrap(uint16_t flags, uint16_t type, const bytes &content, const bytes &bet
     if (flags & GRE_CHECKSUM)
         at<gre_wire_checksum>(&out, 4)->checksum = checksum_finish(checksum_add(0, out.data(), out.size()));
     return out;
+}
+
+TEST(ip_packet, checksums_are_sums_of_words) {
+    bytes memory(1700, 0xff);
+    for (size_t i = 0; i < 600; i++)
+        memory[i * 2] = static_cast<uint8_t>(i * 31);
+    for (size_t start = 0; start < 3; start++)
+        for (size_t length = 0; start + length <= memory.size(); length += length < 300 ? 1 : 97) {
+            uint32_t sum = 0;
+            for (size_t i = 0; i < length; i++)
+                sum += uint32_t{memory[start + i]} << (i % 2 ? 0 : 8);
+            while (sum >> 16)
+                sum = (sum & 0xffff) + (sum >> 16);
+            ASSERT_EQ(to_host(checksum_fold(checksum_add(0, &memory[start], length))), sum) << length;
+        }
 }
 
 TEST(gre, headers_are_taken_or_refused) {
@@ -490,6 +506,7 @@ int redirect_once() {
 
 int child_main(int commands, int answers) {
     prctl(PR_SET_PDEATHSIG, SIGKILL);
+    close_kernel_socket(); // when tests are repeated the parent has one, of its own namespace
     if (unshare(CLONE_NEWNET) != 0)
         return 1;
     std::string error;
@@ -528,9 +545,11 @@ struct live_plane : testing::Test {
         child = fork();
         if (child == 0) {
             close(commands[1]);
+            close(answers[0]);
             _exit(child_main(commands[0], answers[1]));
         }
         close(commands[0]);
+        close(answers[1]); // the child's death ends the wait for its answer
         ASSERT_TRUE(answered());
         const std::string pid = std::to_string(child), inside = "nsenter -t " + pid + " -n ip ";
         shell("ip link add va address 02:00:00:00:00:01 type veth peer name vr netns " + pid);
@@ -544,8 +563,9 @@ struct live_plane : testing::Test {
         std::string error;
         EXPECT_TRUE(user_plane.drop_link("wccp0", &error)) << error;
         EXPECT_EQ(if_nametoindex("wccp0"), 0u);
-        shell("ip link del va"); // before the child exits, whose namespace takes it along
+        shell("ip link del va"); // while the child lives: the end of its namespace removes the device as well
         close(commands[1]);
+        close(answers[0]);
         kill(child, SIGKILL);
         waitpid(child, nullptr, 0);
     }

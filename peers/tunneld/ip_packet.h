@@ -42,7 +42,7 @@ static_assert(sizeof(udp_wire_header) == 8 && alignof(udp_wire_header) == 1);
 
 constexpr size_t IP4_MAX_HEADER = 60, TCP_MAX_HEADER = 60, IP4_MAX_PACKET = 65535;
 
-// Bytes of the header, from its own field; the caller has checked that the fixed part is there.
+// The length of the header in bytes, from its own field; the caller has checked that the fixed part is there.
 constexpr size_t ip4_header_length(const ip4_wire_header &ip) {
     return (ip.version_ihl & 0x0fu) * 4u;
 }
@@ -50,15 +50,15 @@ constexpr size_t tcp_header_length(const tcp_wire_header &tcp) {
     return (tcp.data_offset >> 4) * 4u;
 }
 
-// The one's complement sum over words as they lie in memory, which comes out right in memory again. Only the
-// last piece of a sum may have an odd length.
+// Adds bytes to a one's complement sum. It is computed with words in the machine's byte order, which gives
+// the right bytes when the result is stored. Only the last piece of a sum may have an odd length; all of it
+// is at most a packet.
 uint64_t checksum_add(uint64_t sum, const void *bytes, size_t length);
-be16 checksum_fold(uint64_t sum);   // as a partial checksum is stored
-be16 checksum_finish(uint64_t sum); // its complement, as a whole one is stored
-bool checksum_is_right(uint64_t sum);
-// Over the pseudo-header of what follows the IP header, `length` bytes of it.
+be16 checksum_fold(uint64_t sum);     // 16 bits: the form of a partial checksum
+be16 checksum_finish(uint64_t sum);   // their complement: the form of a complete checksum
+bool checksum_is_right(uint64_t sum); // of a sum that includes the checksum
+// The sum of the pseudo-header for `length` bytes after the IP header.
 uint64_t checksum_pseudo(const ip4_wire_header &ip, size_t length);
 
-// Whether the bytes begin with an IPv4 header that is whole and right, checksum included, of a packet that
-// lies within them.
+// Whether the bytes begin with a complete IPv4 header with a right checksum, and hold the whole packet.
 bool ip4_is_valid(const uint8_t *bytes, size_t length);

@@ -17,8 +17,9 @@ struct socket_release {
 };
 std::unique_ptr<nl_sock, socket_release> kernel;
 
-// An unanswered request leaves the socket out of step: it is closed then, and opened anew by the next one.
-nl_sock *kernel_socket() {
+// The socket, opened if necessary. It is closed after a request that was not answered, since that answer
+// could still come and be taken for the next request's.
+nl_sock *open_kernel_socket() {
     if (kernel)
         return kernel.get();
     kernel.reset(nl_socket_alloc());
@@ -29,7 +30,7 @@ nl_sock *kernel_socket() {
         return nullptr;
     }
     nl_socket_disable_auto_ack(kernel.get());
-    // Dumps are filtered by the kernel; an older one gives everything.
+    // The kernel then filters dumps by the request's header. An old kernel ignores it and sends everything.
     const int on = 1;
     setsockopt(nl_socket_get_fd(kernel.get()), SOL_NETLINK, NETLINK_GET_STRICT_CHK, &on, sizeof on);
     return kernel.get();
@@ -41,19 +42,19 @@ struct exchange {
     int error = 0;
 };
 
-int take_error(sockaddr_nl *, nlmsgerr *message, void *context) {
+int take_error_answer(sockaddr_nl *, nlmsgerr *message, void *context) {
     auto *state = static_cast<exchange *>(context);
     state->done = true;
     state->error = -message->error;
     return NL_STOP;
 }
 
-int take_end(nl_msg *, void *context) {
+int take_last_answer(nl_msg *, void *context) {
     static_cast<exchange *>(context)->done = true;
     return NL_STOP;
 }
 
-int take_answer(nl_msg *message, void *context) {
+int take_one_answer(nl_msg *message, void *context) {
     auto *state = static_cast<exchange *>(context);
     if (state->each)
         (*state->each)(nlmsg_hdr(message));
@@ -64,9 +65,9 @@ struct callbacks_release {
     void operator()(nl_cb *callbacks) const { nl_cb_put(callbacks); }
 };
 
-// EINTR: the table has changed during the dump.
-int transact(nl_msg *message, const std::function<void(nlmsghdr *)> *each) {
-    nl_sock *socket = kernel_socket();
+// Sends a request and reads all of its answer. EINTR: the table has changed during the dump.
+int exchange_messages(nl_msg *message, const std::function<void(nlmsghdr *)> *each) {
+    nl_sock *socket = open_kernel_socket();
     if (!socket)
         return errno ? errno : EIO;
     const std::unique_ptr<nl_cb, callbacks_release> callbacks(nl_cb_alloc(NL_CB_DEFAULT));
@@ -74,11 +75,11 @@ int transact(nl_msg *message, const std::function<void(nlmsghdr *)> *each) {
         throw std::bad_alloc();
     exchange state;
     state.each = each;
-    nl_cb_err(callbacks.get(), NL_CB_CUSTOM, take_error, &state);
-    nl_cb_set(callbacks.get(), NL_CB_FINISH, NL_CB_CUSTOM, take_end, &state);
-    nl_cb_set(callbacks.get(), NL_CB_ACK, NL_CB_CUSTOM, take_end, &state);
-    nl_cb_set(callbacks.get(), NL_CB_VALID, NL_CB_CUSTOM, take_answer, &state);
-    nlmsg_hdr(message)->nlmsg_seq = NL_AUTO_SEQ; // a new one when it is sent again
+    nl_cb_err(callbacks.get(), NL_CB_CUSTOM, take_error_answer, &state);
+    nl_cb_set(callbacks.get(), NL_CB_FINISH, NL_CB_CUSTOM, take_last_answer, &state);
+    nl_cb_set(callbacks.get(), NL_CB_ACK, NL_CB_CUSTOM, take_last_answer, &state);
+    nl_cb_set(callbacks.get(), NL_CB_VALID, NL_CB_CUSTOM, take_one_answer, &state);
+    nlmsg_hdr(message)->nlmsg_seq = NL_AUTO_SEQ; // otherwise a second try would have the first one's number
     if (nl_send_auto(socket, message) < 0) {
         const int error = errno;
         kernel.reset();
@@ -87,7 +88,7 @@ int transact(nl_msg *message, const std::function<void(nlmsghdr *)> *each) {
     while (!state.done) {
         const int result = nl_recvmsgs(socket, callbacks.get());
         if (result == -NLE_DUMP_INTR)
-            state.error = EINTR; // the rest of the dump still comes
+            state.error = EINTR; // the rest of the dump still has to be read
         else if (result < 0 && !state.done) {
             kernel.reset();
             return EIO;
@@ -107,7 +108,7 @@ netlink_message make_netlink_message(int type, int flags, const void *header, si
 
 int change_kernel(nl_msg *message) {
     nlmsg_hdr(message)->nlmsg_flags |= NLM_F_ACK;
-    return transact(message, nullptr);
+    return exchange_messages(message, nullptr);
 }
 
 int query_kernel(nl_msg *message, const std::function<void(nlmsghdr *)> &each,
@@ -115,7 +116,11 @@ int query_kernel(nl_msg *message, const std::function<void(nlmsghdr *)> &each,
     int error = EINTR;
     for (int i = 0; i < QUERY_TRIES && error == EINTR; i++) {
         restart();
-        error = transact(message, &each);
+        error = exchange_messages(message, &each);
     }
     return error;
+}
+
+void close_kernel_socket() {
+    kernel.reset();
 }

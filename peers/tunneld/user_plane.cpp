@@ -1,13 +1,15 @@
-// The data plane in user space. One thread takes GRE packets out of a packet ring, checks them, and writes
-// what they carry into the TUN device of their tunnel, segments of a flow merged into large ones. What it
-// reads from a TUN device is split again and sent to the router through a raw socket.
+// The data plane `user`. Its thread takes GRE packets out of a packet ring, checks them, and writes what they
+// carry into the TUN device of their tunnel, with segments of a flow merged into large ones. The packets that
+// it reads from a TUN device are split again and sent to the router through a raw socket.
 //
-// The thread holds the lock while it works on a batch, and sleeps in epoll_wait without it. Batches follow
-// each other closely under load: whoever else wants the lock says so first, and the thread lets it go before.
+// The thread holds the lock while it works on a batch of packets, but not while it waits. Under load it would
+// take the lock again at once: other threads therefore announce that they want it, and the thread lets them
+// go first.
 
 #include <linux/filter.h>
 #include <net/if.h>
 #include <netinet/in.h>
+#include <poll.h>
 #include <signal.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
@@ -29,6 +31,7 @@
 #include "peers/tunneld/gre.h"
 #include "peers/tunneld/passing.h"
 #include "peers/tunneld/plane.h"
+#include "peers/tunneld/redirect_memory.h"
 #include "peers/tunneld/user_ring.h"
 #include "peers/tunneld/user_tun.h"
 
@@ -36,21 +39,23 @@ user_plane_options user_plane_settings;
 
 namespace {
 
-constexpr uint32_t RING_BATCH = 256; // packets that wait for a flush at most
-// After a round with so many packets, others are under way: gathering them for a moment saves a wake-up for
-// each and lets more of them be merged. A packet on a quiet line never waits.
+constexpr uint32_t RING_BATCH = 256; // packets that are taken from the ring at once
+// After a batch of so many packets more are on their way. Waiting for them once, instead of being woken for
+// every few, saves most of the processor time, and more segments can be merged. On a quiet line no packet
+// waits.
 constexpr uint32_t BUSY_PACKETS = 8;
-constexpr timespec GATHER_TIME = {0, 50000};
-constexpr int THREAD_NICE = -10; // the ring overflows while the thread waits for a processor
+constexpr timespec GATHER_TIME = {0, 200'000};
+constexpr int THREAD_NICE = -10; // the ring can overflow while the thread waits for a processor
 constexpr int OUTER_TTL = 64, SEND_BUFFER = 8 << 20;
-constexpr uint64_t WAKE_SERIAL = 0, RING_SERIAL = 1, FIRST_LINK_SERIAL = 2;
+constexpr int EVENTS_MAX = 16;
+constexpr uint64_t WAKE_SERIAL = 0, FIRST_LINK_SERIAL = 1;
 
 struct user_link {
-    uint64_t serial; // in epoll's data
+    uint64_t serial; // identifies the link in epoll's data
     link_wish wish;
     tun_device tun;
-    bool gone = false; // somebody has removed the interface
-    int out = -1;      // raw socket from `local` to `remote`
+    bool gone = false; // somebody else has removed the interface
+    int out = -1;      // raw socket from `local` to `remote`; passing links have none
     link_counters counters;
 };
 
@@ -66,17 +71,7 @@ struct link_freer {
 };
 using owned_link = std::unique_ptr<user_link, link_freer>;
 
-// Redirect headers by flow, for packets that go back. A newer flow takes the place of an older one.
-struct remembered_redirect {
-    uint64_t link = 0; // serial, 0 for an empty place
-    uint64_t addresses = 0;
-    uint32_t ports = 0;
-    uint8_t protocol = 0;
-    gre_wire_redirect header = {};
-};
-constexpr size_t REMEMBERED_BITS = 14;
-
-// Packets on their way to one router. They point into `received` and into themselves.
+// Packets on their way to one router. The messages point into `received` and into the batch itself.
 constexpr size_t OUT_BATCH = 64, RECEIVE_BUFFER = 4 * 65536;
 struct out_batch {
     size_t count = 0;
@@ -88,8 +83,8 @@ struct out_batch {
 };
 
 struct user_state {
-    std::mutex lock;              // of all below but what only the thread uses
-    std::atomic<int> waiting = 0; // for the lock, beside the thread
+    std::mutex lock;              // of everything that is not the thread's own
+    std::atomic<int> waiting = 0; // number of other threads that want the lock
     std::atomic<bool> stop = false;
     std::map<std::string, owned_link> links; // by interface name
     std::unordered_map<uint64_t, user_link *> by_ends, by_serial;
@@ -98,17 +93,18 @@ struct user_state {
     uint64_t next_serial = FIRST_LINK_SERIAL;
     uint64_t refused[REFUSALS] = {};
     std::map<uint32_t, uint64_t> refused_sources;
-    int epoll = -1, wake = -1;
+    int epoll = -1; // of the TUN devices and `wake`
+    int wake = -1;  // readable when the thread is to stop
     packet_ring ring;
     std::thread thread;
     // The thread's own:
     coalescer merger = {};
     out_batch out;
-    std::unique_ptr<remembered_redirect[]> remembered;
+    redirect_memory redirects;
 };
 std::unique_ptr<user_state> state;
 
-// The lock for everybody but the thread.
+// Holds the lock; for all threads but the plane's own.
 struct guest_guard {
     explicit guest_guard(user_state *of) : held(of) {
         held->waiting++;
@@ -121,7 +117,7 @@ struct guest_guard {
     user_state *held;
 };
 
-bool fail(std::string *out_error, const std::string &what) {
+bool fail_with_errno(std::string *out_error, const std::string &what) {
     *out_error = what + ": " + strerror(errno);
     return false;
 }
@@ -130,45 +126,7 @@ uint64_t key_of_ends(uint32_t local, uint32_t remote) {
     return uint64_t{local} << 32 | remote;
 }
 
-// --- redirect headers
-
-remembered_redirect flow_of(const user_link &link, const uint8_t *packet, size_t length) {
-    const auto *ip = reinterpret_cast<const ip4_wire_header *>(packet);
-    const size_t header = ip4_header_length(*ip);
-    remembered_redirect flow;
-    flow.link = link.serial;
-    memcpy(&flow.addresses, &ip->source, sizeof flow.addresses);
-    flow.protocol = ip->protocol;
-    const bool has_ports = ip->protocol == PROTOCOL_TCP || ip->protocol == PROTOCOL_UDP;
-    if (has_ports && !(to_host(ip->fragment) & IP4_FRAGMENT) && length >= header + sizeof flow.ports)
-        memcpy(&flow.ports, packet + header, sizeof flow.ports);
-    return flow;
-}
-
-remembered_redirect *place_of(user_state *plane, const remembered_redirect &flow) {
-    const uint64_t key = (flow.addresses ^ (uint64_t{flow.ports} << 16) ^ flow.link) + flow.protocol;
-    return &plane->remembered[(key * 0x9e3779b97f4a7c15u) >> (64 - REMEMBERED_BITS)];
-}
-
-void remember_redirect(user_state *plane, const user_link &link, const gre_content &content) {
-    remembered_redirect flow = flow_of(link, content.packet, content.length);
-    remembered_redirect *place = place_of(plane, flow);
-    if (!content.has_redirect)
-        flow.link = 0;
-    flow.header = content.redirect;
-    *place = flow;
-}
-
-const gre_wire_redirect *recall_redirect(user_state *plane, const user_link &link, const uint8_t *packet,
-                                         size_t length) {
-    const remembered_redirect flow = flow_of(link, packet, length);
-    const remembered_redirect *place = place_of(plane, flow);
-    const bool same = place->link == flow.link && place->addresses == flow.addresses &&
-                      place->ports == flow.ports && place->protocol == flow.protocol;
-    return same ? &place->header : nullptr;
-}
-
-// --- from the router
+// --- From the router
 
 void write_to_tun(void *target, const iovec *parts, size_t count, uint32_t packets) {
     auto *link = static_cast<user_link *>(target);
@@ -177,7 +135,7 @@ void write_to_tun(void *target, const iovec *parts, size_t count, uint32_t packe
 }
 
 void refuse_source(user_state *plane, const gre_outer &outer) {
-    bool ours = false; // other GRE of this host is none of our business
+    bool ours = false; // the host may have GRE tunnels that are not tunneld's
     for (const auto &[name, link] : plane->links)
         ours = ours || link->wish.local == outer.local;
     if (!ours)
@@ -190,9 +148,10 @@ void refuse_source(user_state *plane, const gre_outer &outer) {
         plane->refused_sources[outer.remote] = 1;
 }
 
-// Where the packet goes to the kernel: by the link that it came in by, or as one that is another appliance's
-// unless the kernel has a socket for it. What another appliance has passed on has no redirect header.
-user_link *choose_way(user_state *plane, user_link *link, const gre_content &content) {
+// The interface by which the kernel gets the packet: that of its tunnel, or, for a packet of another
+// appliance's bucket, the passing link to that appliance. What another appliance has passed on is not passed
+// on again.
+user_link *choose_interface(user_state *plane, user_link *link, const gre_content &content) {
     uint32_t local = 0;
     const uint32_t member = find_passing_member(plane->passing, content, &local);
     if (!member || link->wish.kind == link_kind::member)
@@ -201,8 +160,9 @@ user_link *choose_way(user_state *plane, user_link *link, const gre_content &con
     return found == plane->passing_by_ends.end() || found->second->gone ? link : found->second;
 }
 
-// A packet that the sender's kernel, on this machine, or this one's receive offload has left large.
-refusal carry_large(user_state *plane, user_link *link, user_link *way, const ring_packet &from,
+// A packet of several segments: left large by a sender on this machine, or merged by a device's receive
+// offload.
+refusal carry_large(user_state *plane, user_link *link, user_link *to, const ring_packet &from,
                     const gre_content &content) {
     virtio_header header = from.header;
     header.header_length = 0;
@@ -210,13 +170,13 @@ refusal carry_large(user_state *plane, user_link *link, user_link *way, const ri
     uint32_t packets;
     if (!large_packet_is_valid(header, content.packet, content.length, &packets))
         return REFUSED_INNER;
-    if (header.gso_type == VIRTIO_LARGE_UDP && !way->tun.takes_large_udp)
+    if (header.gso_type == VIRTIO_LARGE_UDP && !to->tun.takes_large_udp)
         return REFUSED_ROOM;
     link->counters.packets_in += packets;
     link->counters.bytes_in += content.length;
-    coalesce_flush(&plane->merger); // what came before it
+    coalesce_flush(&plane->merger); // earlier packets of its flow go first
     const iovec parts[2] = {{&header, sizeof header}, {content.packet, content.length}};
-    write_to_tun(way, parts, 2, packets);
+    write_to_tun(to, parts, 2, packets);
     return REFUSALS;
 }
 
@@ -227,15 +187,15 @@ refusal carry_payload(user_state *plane, user_link *link, const ring_packet &fro
     if (why != REFUSALS)
         return why;
     if (user_plane_settings.redirect_header)
-        remember_redirect(plane, *link, content);
+        remember_redirect(&plane->redirects, link->serial, content);
     link->counters.redirect_headers += content.has_redirect;
-    user_link *const way = choose_way(plane, link, content);
+    user_link *const to = choose_interface(plane, link, content);
     if (merged)
-        return carry_large(plane, link, way, from, content);
+        return carry_large(plane, link, to, from, content);
     link->counters.packets_in++;
     link->counters.bytes_in += content.length;
-    plane->merger.merge_udp = way->tun.takes_large_udp;
-    coalesce_packet(&plane->merger, way, content.packet, content.length);
+    plane->merger.merge_udp = to->tun.takes_large_udp;
+    coalesce_packet(&plane->merger, to, content.packet, content.length);
     return REFUSALS;
 }
 
@@ -244,7 +204,8 @@ void carry_packet(user_state *plane, const ring_packet &packet) {
         plane->refused[REFUSED_ROOM]++;
         return;
     }
-    // From a sender on this machine: the checksum inside is as yet the pseudo-header's.
+    // A sender on this machine leaves the inner checksum to the device: so far it covers the pseudo-header
+    // only.
     if (packet.header.gso_type == VIRTIO_NOT_LARGE &&
         !complete_checksum(packet.header, packet.bytes, packet.length)) {
         plane->refused[REFUSED_LENGTH]++;
@@ -264,14 +225,14 @@ void carry_packet(user_state *plane, const ring_packet &packet) {
         found->second->counters.refused[why]++;
 }
 
-// Packets taken.
+// Returns the number of packets.
 uint32_t drain_ring(user_state *plane) {
     ring_packet packet;
     uint32_t count = 0;
     while (count < RING_BATCH && ring_next(&plane->ring, &packet)) {
         count++;
         carry_packet(plane, packet);
-        if (packet.shared)
+        if (packet.shared) // the next large packet overwrites this one
             coalesce_flush(&plane->merger);
     }
     coalesce_flush(&plane->merger);
@@ -279,10 +240,10 @@ uint32_t drain_ring(user_state *plane) {
     return count;
 }
 
-// --- to the router
+// --- To the router
 
 void send_batch(out_batch *batch, user_link *link) {
-    bool again = true; // an error that an earlier packet met is reported by the next send
+    bool again = true; // sendmmsg() can report an error that an earlier packet has caused
     for (size_t sent = 0; sent < batch->count;) {
         const int result = sendmmsg(link->out, batch->messages + sent,
                                     static_cast<unsigned>(batch->count - sent), MSG_DONTWAIT);
@@ -305,7 +266,7 @@ void send_batch(out_batch *batch, user_link *link) {
     batch->count = 0;
 }
 
-// Fills the last message, whose segment is there already.
+// Makes a message of the segment that has been written to the next place of the batch.
 void finish_message(out_batch *batch, const gre_wire_redirect *redirect) {
     const size_t at = batch->count++;
     split_segment &segment = batch->segments[at];
@@ -320,10 +281,11 @@ void finish_message(out_batch *batch, const gre_wire_redirect *redirect) {
     batch->messages[at].msg_hdr.msg_iovlen = count;
 }
 
-void give_back(user_state *plane, user_link *link, const virtio_header &header, uint8_t *packet,
-               size_t length) {
+void return_packet(user_state *plane, user_link *link, const virtio_header &header, uint8_t *packet,
+                   size_t length) {
+    // Without IPv6: the kernel looks for neighbours on every interface. A passing link has no socket.
     if ((length > 0 && packet[0] >> 4 != 4) || link->out < 0)
-        return; // the kernel looks for IPv6 neighbours on every interface
+        return;
     out_batch *batch = &plane->out;
     packet_split split;
     if (!split_begin(&split, header, packet, length)) {
@@ -332,7 +294,7 @@ void give_back(user_state *plane, user_link *link, const virtio_header &header, 
     }
     const gre_wire_redirect *redirect = nullptr;
     if (user_plane_settings.redirect_header)
-        redirect = recall_redirect(plane, *link, packet, length);
+        redirect = recall_redirect(plane->redirects, link->serial, packet, length);
     while (split_next(&split, &batch->segments[batch->count])) {
         finish_message(batch, redirect);
         if (batch->count == OUT_BATCH)
@@ -345,7 +307,7 @@ void leave_interface(user_state *plane, user_link *link) {
     link->gone = true;
 }
 
-// Packets taken, large ones counted once.
+// Returns the number of packets; a large one counts once.
 uint32_t drain_tun(user_state *plane, user_link *link) {
     out_batch *batch = &plane->out;
     size_t used = 0;
@@ -366,57 +328,58 @@ uint32_t drain_tun(user_state *plane, user_link *link) {
             continue;
         }
         const size_t length = static_cast<size_t>(got) - sizeof header;
-        give_back(plane, link, header, packet, length);
+        return_packet(plane, link, header, packet, length);
         used += length;
     }
     send_batch(batch, link);
     return reads;
 }
 
-// --- the thread
+// --- The thread
 
-// Packets taken.
-uint32_t serve(user_state *plane, const epoll_event &event) {
+// Waits for packets, or after a busy batch gathers them. The ring is not in epoll's set: an entry there would
+// be woken for each packet, while one of poll() exists only as long as the thread sleeps. Returns the number
+// of events of TUN devices.
+int wait_for_packets(user_state *plane, uint32_t taken, epoll_event (&events)[EVENTS_MAX]) {
+    if (taken < BUSY_PACKETS) {
+        pollfd ready[] = {{plane->ring.fd, POLLIN, 0}, {plane->epoll, POLLIN, 0}};
+        if (poll(ready, std::size(ready), -1) > 0 && !ready[1].revents)
+            return 0;
+    } else if (taken < RING_BATCH) {
+        nanosleep(&GATHER_TIME, nullptr);
+    }
+    return epoll_wait(plane->epoll, events, EVENTS_MAX, 0);
+}
+
+// Returns the number of packets.
+uint32_t serve_event(user_state *plane, const epoll_event &event) {
     const uint64_t serial = event.data.u64; // a copy: epoll_event is packed, and the member may be misaligned
-    if (serial == WAKE_SERIAL)
-        return 0;
-    if (serial == RING_SERIAL)
-        return drain_ring(plane);
-    const auto found = plane->by_serial.find(serial);
-    if (found == plane->by_serial.end() || found->second->gone)
-        return 0;
-    return drain_tun(plane, found->second);
+    const auto found = plane->by_serial.find(serial); // not there: `wake`, or a link that was just removed
+    return found == plane->by_serial.end() || found->second->gone ? 0 : drain_tun(plane, found->second);
 }
 
-// One look at what epoll has to tell, which is waited for. Packets taken.
-uint32_t serve_events(user_state *plane) {
-    epoll_event events[16];
-    const int count = epoll_wait(plane->epoll, events, 16, -1);
-    while (plane->waiting)
-        std::this_thread::yield();
-    const std::lock_guard<std::mutex> guard(plane->lock);
-    uint32_t packets = 0;
-    for (int i = 0; i < count; i++)
-        packets += serve(plane, events[i]);
-    return packets;
-}
-
-void run(user_state *plane) {
+void carry_packets(user_state *plane) {
     prctl(PR_SET_NAME, "tunneld_plane");
     prctl(PR_SET_TIMERSLACK, 1000);            // nanoseconds
     setpriority(PRIO_PROCESS, 0, THREAD_NICE); // of this thread; it may be refused
+    uint32_t taken = 0;
     while (!plane->stop) {
-        const uint32_t packets = serve_events(plane);
-        if (packets >= BUSY_PACKETS && packets < RING_BATCH)
-            nanosleep(&GATHER_TIME, nullptr);
+        epoll_event events[EVENTS_MAX];
+        const int count = wait_for_packets(plane, taken, events);
+        while (plane->waiting)
+            std::this_thread::yield();
+        const std::lock_guard<std::mutex> guard(plane->lock);
+        taken = drain_ring(plane);
+        for (int i = 0; i < count; i++)
+            taken += serve_event(plane, events[i]);
     }
 }
 
-bool watch(user_state *plane, int fd, uint64_t serial, std::string *out_error) {
+bool watch_descriptor(user_state *plane, int fd, uint64_t serial, std::string *out_error) {
     epoll_event event = {};
     event.events = EPOLLIN;
     event.data.u64 = serial;
-    return epoll_ctl(plane->epoll, EPOLL_CTL_ADD, fd, &event) == 0 || fail(out_error, "epoll");
+    return epoll_ctl(plane->epoll, EPOLL_CTL_ADD, fd, &event) == 0 || fail_with_errno(out_error, "epoll");
 }
 
 bool start_thread(user_state *plane, std::string *out_error) {
@@ -425,7 +388,7 @@ bool start_thread(user_state *plane, std::string *out_error) {
     pthread_sigmask(SIG_SETMASK, &all, &before); // signals are for the main thread
     bool started = true;
     try {
-        plane->thread = std::thread(run, plane);
+        plane->thread = std::thread(carry_packets, plane);
     } catch (const std::system_error &error) {
         *out_error = std::string("thread: ") + error.what();
         started = false;
@@ -434,7 +397,7 @@ bool start_thread(user_state *plane, std::string *out_error) {
     return started;
 }
 
-void close_plane() {
+void close_user_plane() {
     if (!state)
         return;
     state->stop = true;
@@ -450,33 +413,34 @@ void close_plane() {
     state.reset();
 }
 
-bool open_plane(std::string *out_error) {
+bool open_user_plane(std::string *out_error) {
     if (state)
         return true;
     state = std::make_unique<user_state>();
     state->merger.sink = write_to_tun;
-    state->remembered = std::make_unique<remembered_redirect[]>(size_t{1} << REMEMBERED_BITS);
     state->epoll = epoll_create1(EPOLL_CLOEXEC);
     state->wake = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     bool opened = state->epoll >= 0 && state->wake >= 0;
     if (!opened)
-        fail(out_error, "epoll");
+        fail_with_errno(out_error, "epoll");
     opened = opened && ring_open(&state->ring, out_error) &&
-             watch(state.get(), state->wake, WAKE_SERIAL, out_error) &&
-             watch(state.get(), state->ring.fd, RING_SERIAL, out_error) &&
+             watch_descriptor(state.get(), state->wake, WAKE_SERIAL, out_error) &&
              start_thread(state.get(), out_error);
     if (!opened)
-        close_plane();
+        close_user_plane();
     return opened;
 }
 
-// --- links
+// --- Links
+//
+// Only the program's main thread makes and drops links. It opens and closes devices and sockets without the
+// lock, since that takes milliseconds, in which the ring could overflow.
 
-// Sends only: what comes in is the ring's.
+// For sending only: packets are received by the ring, and the socket's filter refuses all.
 bool open_raw_socket(const link_wish &wish, int *out_fd, std::string *out_error) {
     const int fd = socket(AF_INET, SOCK_RAW | SOCK_NONBLOCK | SOCK_CLOEXEC, IPPROTO_GRE);
     if (fd < 0)
-        return fail(out_error, "raw socket");
+        return fail_with_errno(out_error, "raw socket");
     *out_fd = fd;
     sock_filter refuse_all[] = {BPF_STMT(BPF_RET | BPF_K, 0)};
     const sock_fprog program = {1, refuse_all};
@@ -490,30 +454,34 @@ bool open_raw_socket(const link_wish &wish, int *out_fd, std::string *out_error)
         setsockopt(fd, IPPROTO_IP, IP_TTL, &ttl, sizeof ttl) != 0 ||
         setsockopt(fd, IPPROTO_IP, IP_MTU_DISCOVER, &fragment, sizeof fragment) != 0 ||
         setsockopt(fd, IPPROTO_IP, IP_FREEBIND, &on, sizeof on) != 0)
-        return fail(out_error, "raw socket's options");
+        return fail_with_errno(out_error, "raw socket's options");
     if (bind(fd, reinterpret_cast<const sockaddr *>(&local), sizeof local) != 0)
-        return fail(out_error, "raw socket's address");
+        return fail_with_errno(out_error, "raw socket's address");
     if (connect(fd, reinterpret_cast<const sockaddr *>(&remote), sizeof remote) != 0)
-        return fail(out_error, "raw socket's destination");
+        return fail_with_errno(out_error, "raw socket's destination");
     return true;
 }
 
-void forget_link(user_state *plane, const std::string &name) {
+// Takes the link out of the tables. The caller closes it without the lock, which also takes it out of epoll's
+// set.
+owned_link take_link_out(user_state *plane, const std::string &name) {
+    const guest_guard guard(plane);
     const auto found = plane->links.find(name);
     if (found == plane->links.end())
-        return;
-    const user_link &link = *found->second;
-    const auto by_ends = plane->by_ends.find(key_of_ends(link.wish.local, link.wish.remote));
-    if (by_ends != plane->by_ends.end() && by_ends->second == &link)
-        plane->by_ends.erase(by_ends);
-    if (link.wish.kind == link_kind::passing)
-        plane->passing_by_ends.erase(key_of_ends(link.wish.local, link.wish.remote));
-    plane->by_serial.erase(link.serial);
-    plane->links.erase(found); // closing takes it out of epoll
+        return nullptr;
+    owned_link link = std::move(found->second);
+    const uint64_t ends = key_of_ends(link->wish.local, link->wish.remote);
+    auto &by_ends = link->wish.kind == link_kind::passing ? plane->passing_by_ends : plane->by_ends;
+    if (const auto same = by_ends.find(ends); same != by_ends.end() && same->second == link.get())
+        by_ends.erase(same);
+    plane->by_serial.erase(link->serial);
+    plane->links.erase(found);
+    return link;
 }
 
-// The link that is there already, when it is as wished and its interface hasn't gone.
-bool find_link(user_state *plane, const std::string &name, const link_wish &wish, uint32_t *out_index) {
+// The existing link, if it is as wished and its interface is still there.
+bool find_user_link(user_state *plane, const std::string &name, const link_wish &wish, uint32_t *out_index) {
+    const guest_guard guard(plane);
     const auto found = plane->links.find(name);
     if (found == plane->links.end() || found->second->wish != wish || found->second->gone ||
         if_nametoindex(name.c_str()) != found->second->tun.index)
@@ -522,47 +490,47 @@ bool find_link(user_state *plane, const std::string &name, const link_wish &wish
     return true;
 }
 
-bool make_link(const std::string &name, const link_wish &wish, uint32_t *out_index, std::string *out_error) {
+bool make_user_link(const std::string &name, const link_wish &wish, uint32_t *out_index,
+                    std::string *out_error) {
     if (!state) {
         *out_error = "the user-space plane is not open";
         return false;
     }
     user_state *plane = state.get();
-    const guest_guard guard(plane);
-    if (find_link(plane, name, wish, out_index))
+    if (find_user_link(plane, name, wish, out_index))
         return true;
-    forget_link(plane, name);
+    take_link_out(plane, name).reset(); // its device has to be closed before it can be opened again
     owned_link link(new user_link);
     link->serial = plane->next_serial++;
     link->wish = wish;
     const bool carries = wish.kind != link_kind::passing;
     if ((carries && !open_raw_socket(wish, &link->out, out_error)) || !tun_open(name, &link->tun, out_error))
         return false;
-    if (!watch(plane, link->tun.fd, link->serial, out_error))
-        return false;
     *out_index = link->tun.index;
+    const guest_guard guard(plane);
+    if (!watch_descriptor(plane, link->tun.fd, link->serial, out_error))
+        return false;
     plane->by_serial[link->serial] = link.get();
     (carries ? plane->by_ends : plane->passing_by_ends)[key_of_ends(wish.local, wish.remote)] = link.get();
     plane->links[name] = std::move(link);
     return true;
 }
 
-bool drop_link(const std::string &name, std::string *out_error) {
-    if (state) {
-        const guest_guard guard(state.get());
-        forget_link(state.get(), name);
-    }
+bool drop_user_link(const std::string &name, std::string *out_error) {
+    if (state)
+        take_link_out(state.get(), name).reset();
     return remove_interface(name, out_error);
 }
 
-void read_counters(plane_counters *inout) {
+void read_user_counters(plane_counters *inout) {
     if (!state)
         return;
     const guest_guard guard(state.get());
     state->refused[REFUSED_ROOM] += ring_take_losses(&state->ring);
     for (const auto &[name, link] : state->links) {
         link_counters &out = inout->links[name];
-        const uint64_t fragments = out.fragments; // counted by the sorting rules: what comes in here is whole
+        // Fragments are counted by the sorting rules: the ring gets whole packets.
+        const uint64_t fragments = out.fragments;
         out = link->counters;
         out.fragments = fragments;
     }
@@ -570,7 +538,7 @@ void read_counters(plane_counters *inout) {
     memcpy(inout->refused, state->refused, sizeof inout->refused);
 }
 
-void set_passing(const passing_table &table) {
+void set_user_passing(const passing_table &table) {
     if (!state)
         return;
     passing_lookup lookup;
@@ -579,7 +547,7 @@ void set_passing(const passing_table &table) {
     std::swap(state->passing, lookup);
 }
 
-bool probe(std::string *out_why_not) {
+bool probe_user_plane(std::string *out_why_not) {
     if (!tun_probe(out_why_not))
         return false;
     packet_ring ring;
@@ -590,5 +558,5 @@ bool probe(std::string *out_why_not) {
 
 } // namespace
 
-const data_plane user_plane = {"user",    probe,     open_plane,    close_plane,
-                               make_link, drop_link, read_counters, set_passing};
+const data_plane user_plane = {"user",         probe_user_plane, open_user_plane,    close_user_plane,
+                               make_user_link, drop_user_link,   read_user_counters, set_user_passing};
