@@ -1,15 +1,22 @@
 // The load for bench/traffic.sh, one subcommand each:
-//   traffic_load router LOCAL REMOTE INTERFACE   the router's end of a GRE tunnel, as an interface, until
-//   SIGTERM traffic_load packets DEVICE MAC plain|gre FLOWS RATE SECONDS     small UDP packets, RATE a second
-//   (0: all it can) traffic_load sink PORT                       takes TCP connections, reads them to their
-//   end, and says how much traffic_load source ADDRESS PORT SECONDS BYTES   sends for so long or so much,
-//   whichever ends first (0: no limit) traffic_load split DEVICE                    the device gets packets
-//   of its MTU only: no large segments
-// Results are one JSON object on standard output. Addresses are those of the script.
 //
-// The router is the appliance's own user-space plane with the two ends exchanged: it splits the large
-// segments of the client into packets, completes their checksums, and lets the kernel fragment what has
-// become too large.
+// traffic_load router LOCAL REMOTE INTERFACE
+//     provides the router's end of a GRE tunnel, as an interface, until SIGTERM
+// traffic_load packets DEVICE MAC plain|gre FLOWS RATE SECONDS
+//     sends small UDP packets, RATE a second (0: without a limit)
+// traffic_load sink PORT
+//     accepts TCP connections, reads them to their end, and sends back the number of bytes
+// traffic_load source ADDRESS PORT SECONDS BYTES
+//     sends for a time or up to a size, whichever comes first (0: no limit)
+// traffic_load split DEVICE
+//     turns segmentation offload off: the device gets only packets of its MTU
+//
+// Results are printed as one JSON object. The addresses are those of the script.
+//
+// The router is the appliance's own user-space plane with its two ends exchanged: it splits the client's
+// large segments into packets, completes their checksums, and leaves the fragmentation of large GRE packets
+// to the kernel.
+
 #include <arpa/inet.h>
 #include <linux/ethtool.h>
 #include <linux/if_ether.h>
@@ -70,7 +77,7 @@ uint32_t address_of(const char *text) {
     return ntohl(wire.s_addr);
 }
 
-// --- the router
+// --- The router
 
 int run_router(char **words) {
     std::string error;
@@ -100,7 +107,7 @@ int run_router(char **words) {
     return 0;
 }
 
-// --- small packets
+// --- Small packets
 
 void append(std::vector<uint8_t> *to, const void *bytes, size_t length) {
     const auto *first = static_cast<const uint8_t *>(bytes);
@@ -176,7 +183,7 @@ int run_packets(char **words) {
     std::vector<std::vector<uint8_t>> made(frames);
     std::vector<iovec> parts(frames + burst);
     std::vector<mmsghdr> messages(frames + burst);
-    for (uint32_t i = 0; i < frames + burst; i++) { // the first ones again, for a burst over the end
+    for (uint32_t i = 0; i < frames + burst; i++) { // the first ones again, for a burst that wraps
         if (i < frames)
             made[i] = frame_of(i, mac, gre);
         parts[i] = {made[i % frames].data(), made[i % frames].size()};
@@ -185,7 +192,7 @@ int run_packets(char **words) {
     }
     const double began = now();
     double time = began;
-    uint64_t sent = 0, refused = 0; // refused: the receiver's queue was full
+    uint64_t sent = 0, refused = 0; // refused: by a full queue of the receiver
     while (time - began < seconds) {
         const double due = rate > 0 ? (time - began) * rate : static_cast<double>(sent + burst);
         if (due < static_cast<double>(sent + burst)) {
@@ -209,7 +216,7 @@ int run_packets(char **words) {
 
 // --- TCP
 
-// At the end of a connection the peer gets the number of bytes that have been read, in this machine's order.
+// At the end of a connection the peer gets the number of bytes read, as 64 bits in host order.
 bool read_connection(int fd, uint64_t *total, uint8_t *buffer) {
     const ssize_t got = recv(fd, buffer, CHUNK, MSG_DONTWAIT);
     if (got > 0) {
@@ -255,7 +262,7 @@ int run_sink(char **words) {
     }
 }
 
-// A pause: the other side acknowledged nothing, with bytes to acknowledge.
+// A pause: a time without acknowledgements while bytes are outstanding.
 struct progress {
     uint64_t acknowledged = 0;
     double at = 0, longest_pause = 0;
@@ -320,7 +327,7 @@ int run_source(char **words) {
     return 0;
 }
 
-// --- the device
+// --- The device
 
 int run_split(char **words) {
     const int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);

@@ -1,7 +1,8 @@
-// traffic_wrap DEVICE: until SIGTERM, what leaves by DEVICE for 10.2.0.2 goes in GRE from 10.0.0.1
-// to 10.0.0.101, as a router sends the packets that it redirects for the dynamic service 51. For
-// bench/traffic.sh: a BPF program in the device's way out costs the router so little, and leaves packets in
-// such batches, that the appliance is what is measured. The program goes with the process.
+// traffic_wrap DEVICE, for bench/traffic.sh: until SIGTERM, packets that leave by DEVICE for 10.2.0.2 are
+// sent in GRE from 10.0.0.1 to 10.0.0.101, as a router redirects them for the dynamic service 51. A BPF
+// program at the device's egress does it: it costs the router little and keeps packets in batches, so that
+// the appliance is the bottleneck. The program is detached when the process ends.
+
 #include <arpa/inet.h>
 #include <linux/bpf.h>
 #include <linux/if_ether.h>
@@ -59,7 +60,7 @@ constexpr bpf_insn store(int size, int offset, int value) {
 constexpr bpf_insn call(int function) {
     return op(BPF_JMP | BPF_CALL, 0, 0, 0, function);
 }
-// The number in the register as 16 bits on the wire, into the frame.
+// Stores the lower 16 bits of a register in the frame, in network order.
 constexpr bpf_insn to_wire(uint8_t reg) {
     return op(BPF_ALU | BPF_END | BPF_TO_BE, reg, 0, 0, 16);
 }
@@ -79,9 +80,9 @@ int call_bpf(int command, void *request, size_t size) {
 }
 
 int load_program() {
-    constexpr int AT = -32; // the wrapping in the frame
+    constexpr int AT = -32; // offset of the new headers in the frame
     constexpr int constant = 0x4500 + TTL_AND_GRE + (ROUTER >> 16) + (ROUTER & 0xffff) + (APPLIANCE >> 16) +
-                             (APPLIANCE & 0xffff); // in the sum of the header
+                             (APPLIANCE & 0xffff); // part of the header's checksum
     bpf_insn code[] = {
         copy(PACKET, R1),
         load(R1, PACKET, offsetof(__sk_buff, protocol)),
@@ -131,7 +132,7 @@ int load_program() {
         set(R4, WRAPPING),
         set(R5, 0),
         call(BPF_FUNC_skb_store_bytes),
-        set(R0, NEXT_PROGRAM), // all jumps come here
+        set(R0, NEXT_PROGRAM), // target of all jumps
         op(BPF_JMP | BPF_EXIT, 0, 0, 0, 0),
     };
     constexpr size_t count = std::size(code);

@@ -1,14 +1,15 @@
 // Times of tunneld, in an appliance of its own (lab/in-appliance):
-//   tunneld_timed orders TUNNELD COUNT QUIET     plays wccpd and a router: orders COUNT tunnels one by one,
-//   each after
-//                                                QUIET seconds without a command, and sends GRE packets until
-//                                                one comes back. One line for each: milliseconds to the
-//                                                answer and to that packet
-//   tunneld_timed reconcile PLANE TUNNELS GROUPS     how long the kernel state of so many takes: where there
-//   is nothing,
-//                                                where all is there, and in a process that takes it over
-// Without a configuration all redirected packets are returned: what comes back has been through the whole
-// plane.
+//
+// tunneld_timed orders TUNNELD COUNT QUIET
+//     plays wccpd and a router: orders COUNT tunnels one by one, each after QUIET seconds without a command,
+//     and sends GRE packets until one is returned. Prints a line for each tunnel: milliseconds to the answer
+//     of the order, and to the returned packet
+// tunneld_timed reconcile PLANE TUNNELS GROUPS
+//     how long it takes to make the kernel state, to reconcile it again without changes, and to take it over
+//     in another process
+//
+// Without a configuration all redirected packets are returned: a returned packet has passed the whole plane.
+
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <sched.h>
@@ -39,7 +40,7 @@
 namespace {
 
 constexpr uint32_t APPLIANCE = 0x0a000065, ROUTER = 0x0a000001; // 10.0.0.101, 10.0.0.1
-constexpr double LIMIT = 5;                                     // seconds that anything may take
+constexpr double LIMIT = 5;                                     // seconds; of each wait
 
 [[noreturn]] void die(const std::string &what) {
     fprintf(stderr, "tunneld_timed: %s: %s\n", what.c_str(), strerror(errno));
@@ -60,7 +61,7 @@ void run_command(const std::string &command) {
         die(command);
 }
 
-// --- the router: a process in a network of its own
+// --- The router: a process in its own network namespace
 
 struct shared_times {
     std::atomic<bool> sends;         // packets are to be sent
@@ -123,11 +124,11 @@ void start_router() {
     run_command(in + "address add 10.0.0.1/24 dev eth0 && " + in + "link set eth0 up");
 }
 
-// --- wccpd: the mailbox
+// --- wccpd's side of the mailbox
 
 wccp_tunnel_mailbox *mailbox;
 
-// As wccpd does it; false when there is no answer, or none with success.
+// Gives a command as wccpd does; false if it fails or is not answered.
 bool command(uint16_t code, uint16_t id) {
     mailbox->tunnel_id = id;
     mailbox->local_ip = APPLIANCE;
@@ -169,7 +170,7 @@ void order_and_wait(uint16_t id) {
     times->returned_at = 0;
     times->sends = true;
     sleep_for(0.002);
-    times->returned_at = 0; // nothing comes back through a tunnel that isn't there
+    times->returned_at = 0; // nothing is returned while the tunnel does not exist
     const double ordered = now();
     if (!command(MAILBOX_ADD_TUNNEL, id) || mailbox->fmst_index == WCCP_NO_INDEX)
         die("the order is not answered");
@@ -192,7 +193,7 @@ int run_orders(char **words) {
     make_mailbox();
     start_router();
     const pid_t tunneld = start_tunneld(words[0]);
-    // The first one waits until tunneld has found the mailbox and made its table of rules.
+    // The first order waits until tunneld has found the mailbox and made its rules.
     if (!command(MAILBOX_ADD_TUNNEL, 1) || !command(MAILBOX_DELETE_TUNNEL, 1))
         die("tunneld takes no command");
     for (int i = 0; i < atoi(words[1]); i++) {
@@ -205,7 +206,7 @@ int run_orders(char **words) {
     return status == 0 ? 0 : 1;
 }
 
-// --- kernel state
+// --- Kernel state
 
 appliance_view view_of(uint16_t tunnels, int groups) {
     appliance_view view;
@@ -260,7 +261,7 @@ int run_reconcile(char **words) {
         if (!plane->open(&error))
             die(error);
     };
-    const pid_t first = fork(); // it ends as if killed
+    const pid_t first = fork(); // exits as if it were killed
     if (first == 0) {
         open();
         reconcile_timed("from nothing", *plane, view, false);
