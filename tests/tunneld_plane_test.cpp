@@ -1,5 +1,5 @@
-// The user-space data plane: its reader of GRE, merging and splitting, and the whole of it between two
-// network namespaces.
+// The user-space data plane: reading GRE, merging and splitting, and the complete plane between two network
+// namespaces.
 
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
@@ -48,7 +48,7 @@ tcp_wire_header *tcp(bytes *packet) {
     return at<tcp_wire_header>(packet, sizeof(ip4_wire_header));
 }
 
-// Lengths and checksums as they should be, for a header without options.
+// Corrects lengths and checksums of a packet without IP options.
 void mend(bytes *packet) {
     ip4_wire_header *header = ip(packet);
     header->total_length = to_be16(static_cast<uint16_t>(packet->size()));
@@ -69,7 +69,7 @@ void mend(bytes *packet) {
     *checksum = checksum_finish(checksum_add(checksum_pseudo(*header, length), header + 1, length));
 }
 
-// The number of a packet gives its id, its bytes and, by the payload, its place in the stream.
+// A packet's id, content and, with the payload's size, sequence number follow from its number.
 bytes make_packet(uint8_t protocol, uint32_t number, size_t payload) {
     const size_t transport = protocol == PROTOCOL_TCP ? 32 : sizeof(udp_wire_header);
     bytes packet(sizeof(ip4_wire_header) + transport + payload);
@@ -244,7 +244,7 @@ void merge(const std::vector<bytes> &packets, bool udp = true) {
     coalesce_flush(&merger);
 }
 
-// What comes out of splitting all that was written.
+// Splits all writes.
 std::vector<bytes> split_writes() {
     std::vector<bytes> out;
     for (one_write &write : writes) {
@@ -311,11 +311,11 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
         merge(packets);
         ASSERT_EQ(writes.size(), row.expected);
         EXPECT_TRUE(row.expected == 1 || writes[0].packet == packets[1] || writes[1].packet == packets[1]);
-        // The other way round: what the first packet is like counts as well.
+        // In reverse order: the properties of the first packet matter as well.
         merge({packets[1], packets[0]});
         EXPECT_EQ(writes.size(), 2u);
     }
-    // Without a checksum that is right the first is merged with nothing, and the others go on.
+    // A first packet with a wrong checksum is not merged, but the others are.
     std::vector<bytes> three = {make_packet(PROTOCOL_TCP, 0, 100), make_packet(PROTOCOL_TCP, 1, 100),
                                 make_packet(PROTOCOL_TCP, 2, 100)};
     three[0].back()++;
@@ -330,7 +330,7 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
 TEST(coalesce, splitting_gives_back_what_was_merged) {
     for (const uint8_t protocol : {PROTOCOL_TCP, PROTOCOL_UDP}) {
         std::vector<bytes> packets;
-        for (uint32_t i = 0; i < 150; i++) // past the limit of one large packet, the end of ids and sequences
+        for (uint32_t i = 0; i < 150; i++) // more than one large packet holds; ids and sequence numbers wrap
             packets.push_back(make_packet(protocol, i, 100));
         bytes other = make_packet(protocol, 0, 100); // another flow in between
         ip(&other)->source.bytes[0] = 9;
@@ -342,7 +342,7 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
         ASSERT_EQ(writes.size(), 2u);
         EXPECT_EQ(writes[0].packets + writes[1].packets, 4u);
     }
-    // PSH and a short segment end a packet; CWR and FIN of a large one come out once.
+    // PSH and a short segment end a merged packet. CWR and FIN of a large packet appear in one segment only.
     std::vector<bytes> packets;
     for (uint32_t i = 0; i < 5; i++)
         packets.push_back(make_packet(PROTOCOL_TCP, i, i == 4 ? 30 : 100));
@@ -358,7 +358,8 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
     EXPECT_EQ(std::vector<int>({flags(2), flags(3), flags(4)}),
               std::vector<int>({TCP_ACK | TCP_CWR, TCP_ACK, TCP_ACK | TCP_FIN}));
 
-    // A partial checksum of a packet that isn't large is completed; one outside of it is refused.
+    // The partial checksum of a packet that is not large is completed; one beyond the packet's end is
+    // refused.
     bytes packet = make_packet(PROTOCOL_TCP, 1, 11), partial = packet;
     tcp(&partial)->checksum = checksum_fold(checksum_pseudo(*ip(&partial), partial.size() - 20));
     writes = {{{VIRTIO_NEEDS_CHECKSUM, 0, 0, 0, 20, 16}, partial, 1}};
@@ -375,7 +376,7 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
     }
 }
 
-// --- live: this process is the appliance, a child in a network namespace of its own the router
+// --- Live: this process is the appliance, and a child in another network namespace is the router
 
 constexpr uint32_t APPLIANCE = 0x0a000001, ROUTER = 0x0a000002, STRANGER = 0x0a000003;
 constexpr size_t TRANSFER = 24 << 20, LARGE_DATAGRAM = 30000, PARTIAL_DATAGRAM = 501;
@@ -402,13 +403,13 @@ void send_gre(uint32_t source, const bytes &payload) {
     close(fd);
 }
 
-// The router's hand-made packets; the packet that comes back. Ends with 0 when it is as it should be.
+// Sends packets of each kind as the router, and checks the one that is returned. 0: it was right.
 int send_by_hand() {
     const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
     const bytes packet = make_packet(PROTOCOL_UDP, 1, 1472), redirect = {0x80, 51, 7, 200};
     send_gre(STRANGER, wrap(0, GRE_TYPE_IPV4, packet));
     send_gre(ROUTER, wrap(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}));
-    bytes large = make_packet(PROTOCOL_UDP, 2, LARGE_DATAGRAM); // no frame of the ring holds it
+    bytes large = make_packet(PROTOCOL_UDP, 2, LARGE_DATAGRAM); // larger than a frame of the ring
     ip(&large)->destination = to_be32(0xc0a80901);
     mend(&large);
     send_gre(ROUTER, wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, large));
@@ -429,7 +430,7 @@ int send_by_hand() {
                : 2;
 }
 
-// A datagram as a kernel on the same machine sends it, whose checksum the device would complete.
+// Sends a datagram as a kernel on the same machine does, with a checksum that the device would complete.
 int send_partial() {
     bytes inner = make_packet(PROTOCOL_UDP, 3, PARTIAL_DATAGRAM);
     ip(&inner)->destination = to_be32(0xc0a80901);
@@ -454,7 +455,7 @@ int send_partial() {
     return sent ? 0 : 1;
 }
 
-// Gives back what comes, until the other side has no more.
+// Echoes everything on one connection.
 int echo_once() {
     const int listener = socket(AF_INET, SOCK_STREAM, 0), on = 1;
     const sockaddr_in any = address_of(0xc0a80902, 80);
@@ -471,9 +472,10 @@ int echo_once() {
     return 0;
 }
 
-// --- two appliances: this one and, beside the router, STRANGER. Each is sure that the other has all flows.
+// --- Two appliances: this one and STRANGER, in the router's namespace. Each takes the other for the owner of
+// all flows.
 
-bool be_sure(uint32_t self, uint32_t other, bool by_mask, std::string *out_error) {
+bool believe_in_other(uint32_t self, uint32_t other, bool by_mask, std::string *out_error) {
     appliance_view view;
     view.tunnels[1] = {self, ROUTER};
     view.groups[51] = {"", self, 0, false, {{ROUTER, ROUTER, travel::gre, travel::gre}}};
@@ -487,10 +489,10 @@ bool be_sure(uint32_t self, uint32_t other, bool by_mask, std::string *out_error
 int become_appliance(bool by_mask, std::string *out_error) {
     return unshare(CLONE_NEWNS) != 0 || mount("", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
            mount("", "/run", "tmpfs", 0, nullptr) != 0 || system("ip link set lo up") != 0 ||
-           !be_sure(STRANGER, APPLIANCE, by_mask, out_error);
+           !believe_in_other(STRANGER, APPLIANCE, by_mask, out_error);
 }
 
-// Redirects a packet of a flow that nobody has. It has to come back once, from the other appliance.
+// Redirects a packet of a flow that neither appliance knows. The other one has to return it, once.
 int redirect_once() {
     const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
     send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_TCP, 1, 9), {0x80, 51, 0, 9}));
@@ -576,7 +578,7 @@ struct live_plane : testing::Test {
     }
 };
 
-// Sends and takes back; true when all came back as it was.
+// Sends and receives the echo; true if it is the same.
 bool transfer(uint32_t *out_retransmissions) {
     const int fd = socket(AF_INET, SOCK_STREAM, 0);
     const sockaddr_in to = address_of(0xc0a80902, 80);
@@ -607,7 +609,7 @@ bool transfer(uint32_t *out_retransmissions) {
     return connected && back == sent;
 }
 
-TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
+TEST_F(live_plane, carries_tcp_in_fragments_and_returns_packets) {
     std::string error;
     uint32_t index = 0, again = 0, retransmissions = 0;
     user_plane_settings.redirect_header = true;
@@ -627,7 +629,7 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     const sockaddr_in any = address_of(INADDR_ANY, 80);
     ASSERT_EQ(bind(datagrams, reinterpret_cast<const sockaddr *>(&any), sizeof any), 0);
 
-    // What the router redirects and nobody wants goes back with its redirect header.
+    // A redirected packet that no proxy wants is returned with its redirect header.
     order('h');
     EXPECT_TRUE(answered());
     plane_counters counters;
@@ -659,7 +661,7 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     EXPECT_GT(link.packets_out, TRANSFER / 1448);
     printf("%u retransmissions, %lu without room\n", retransmissions, link.refused[REFUSED_ROOM]);
 
-    // The next process takes the interface over.
+    // The plane finds its interface again.
     user_plane.close();
     ASSERT_EQ(if_nametoindex("wccp0"), index);
     ASSERT_TRUE(user_plane.open(&error)) << error;
@@ -669,7 +671,7 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_gives_back) {
     EXPECT_TRUE(transfer(&retransmissions));
     EXPECT_TRUE(answered());
 
-    // One that somebody has deleted is made anew; until then the thread sleeps.
+    // An interface that was deleted is made again, and the thread does not spin until then.
     shell("ip link del wccp0");
     usleep(100000);
     const clock_t before = clock(); // processor time, of all threads
@@ -686,7 +688,7 @@ TEST_F(live_plane, two_that_take_each_other_for_the_owner_exchange_a_packet_once
         SCOPED_TRACE(kind);
         order(kind);
         ASSERT_TRUE(answered());
-        ASSERT_TRUE(be_sure(APPLIANCE, STRANGER, kind == 'm', &error)) << error;
+        ASSERT_TRUE(believe_in_other(APPLIANCE, STRANGER, kind == 'm', &error)) << error;
         order('r');
         EXPECT_TRUE(answered());
         plane_counters counters;

@@ -1,4 +1,4 @@
-// tunneld's session with mgmtd and its health checks, with real sockets: mgmtd's server runs on the same
+// tunneld's session with mgmtd and its health checks, with real sockets. mgmtd's server runs on the same
 // loop.
 #include <filesystem>
 #include <fstream>
@@ -47,7 +47,7 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
         field(one + "/interval", "0"),
         field(one + "/down", "drop"),
         field(two + "/protocol", "tcp"),
-        field(two + "/ports", "all"), // and no port of a proxy
+        field(two + "/ports", "all"), // without a port of a proxy
         field(NODE_BYPASS_CONFIG "/10.0.0.0\\/8", "10.0.0.0/8"),
         field(NODE_BYPASS_CONFIG "/10.0.0.0\\/8/until", "99"),
         field(NODE_BYPASS_CONFIG "/10.0.0.0\\/33", "10.0.0.0/33"),
@@ -73,13 +73,13 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
     EXPECT_EQ(view.groups[51], (group_view{"eth0", 0, 0, true, {}}));
     EXPECT_EQ(view.groups[52].interface, "");
 
-    // The file of a command may have blanks in its name, as mgmtd takes it; the path of a page may not.
+    // The name of a command's file may contain blanks, which mgmtd allows; the path of a page may not.
     nodes[10].value.text = "/opt/a check";
     EXPECT_FALSE(read_configuration(nodes, &complaints).intercepts.contains(51));
     nodes[9].value.text = "command";
     EXPECT_EQ(read_configuration(nodes, &complaints).intercepts[51].check.argument, "/opt/a check");
 
-    // What a default would turn into "everything" costs the whole intercept.
+    // With bad ports the intercept is ignored, since the default would be all ports.
     for (const char *ports : {"", "80 0", "8080-8000", "65536", "80;443", "-80"}) {
         nodes[6].value.text = ports;
         EXPECT_FALSE(read_configuration(nodes, &complaints).intercepts.contains(51)) << ports;
@@ -153,14 +153,15 @@ TEST(SlotOwners, PacketsGoToTheOwnerOrToTheOneWhoHadMostFlows) {
             EXPECT_TRUE(note_owners(&table, 51, now, START + each.after, TIME) || each.owner == NOBODY);
             EXPECT_FALSE(note_owners(&table, 51, now, START + each.after, TIME)) << "the same again";
         }
-        // Also for the next process.
+        // The file gives the next process the same table.
         const owners_table read = read_owners_file(owners_file_text(table), START + row.asked_after);
         EXPECT_EQ(read, table);
         EXPECT_EQ(slot_targets(read.at(51), row.self, START + row.asked_after, TIME),
                   std::vector<uint32_t>{row.target});
     }
 
-    // A wccpd that has just begun changes nothing; another kind of table has no history.
+    // A wccpd that has just started changes nothing. When the kind of assignment changes, the history is
+    // lost.
     owners_table table;
     note_owners(&table, 0, {false, {}, {A, B}, std::vector<uint32_t>(SLOTS_MAX, A)}, START, TIME);
     note_owners(&table, 0, {false, {}, {A, B}, std::vector<uint32_t>(SLOTS_MAX, B)}, START + 1, TIME);
@@ -169,7 +170,7 @@ TEST(SlotOwners, PacketsGoToTheOwnerOrToTheOneWhoHadMostFlows) {
     EXPECT_EQ(text, "0 hash members 10.0.0.1 10.0.0.2 slots 256*10.0.0.2,100001;10.0.0.1,0,100001\n");
     EXPECT_TRUE(note_owners(&table, 0, {true, {1, 0, 0, 0}, {A, B}, {A, B}}, START + 2, TIME));
     EXPECT_TRUE(table[0].slots[0].former.empty());
-    // A file that is cut or bad loses its bad lines alone; no time lies ahead.
+    // Bad lines of a file are skipped, and times in the future are corrected.
     const owners_table odd = read_owners_file("300 hash members slots\n" + text +
                                                   "7 hash members 10.0.0.1 slots 255*10.0.0.1,0\n" +
                                                   text.substr(0, text.size() - 7) + "x\n9 hash members",
@@ -178,7 +179,7 @@ TEST(SlotOwners, PacketsGoToTheOwnerOrToTheOneWhoHadMostFlows) {
     EXPECT_EQ(odd.at(0).slots[255].former, (std::vector<former_owner>{{A, 0, START - 5}}));
 }
 
-// --- A loop with a ticker, so that it comes round
+// --- A loop with a timer
 
 namespace {
 struct Loop : testing::Test {
@@ -346,7 +347,7 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     EXPECT_EQ(view.groups[51].local, INADDR_LOOPBACK);
     EXPECT_EQ(view.groups[51].routers[0], (group_router{0xc0000201, 0xc0000202}));
 
-    // Owners of slots are asked for now and then, unless flows are not protected.
+    // tunneld asks for the owners of slots regularly, but only with flow protection.
     ASSERT_TRUE(wait_until([&] { return owners_heard > 0; }));
     const int heard = owners_heard;
     EXPECT_TRUE(wait_until([&] { return owners_heard >= heard + 2; }));
@@ -355,7 +356,7 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     owners_heard = 0;
     EXPECT_FALSE(wait_until([&] { return owners_heard > 1; }, 2500));
 
-    // A change that is none is not passed on; methods that have been negotiated are, and stay.
+    // Only real changes are reported. Negotiated methods are kept when they are no longer known.
     method = "L2";
     int before = readings;
     mgmt_link_ask_routers(link);
@@ -367,7 +368,7 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     mgmt_link_ask_routers(link);
     EXPECT_FALSE(wait_until([&] { return readings > before; }, 600));
 
-    // A refused configuration is asked for again.
+    // After a refusal, the configuration is requested again.
     int refusals = 0;
     daemon->fits = [&](uint32_t, size_t) { return refusals++ > 0; };
     set(NODE_GROUP_CONFIG "/51/policy_grp", "7");
@@ -375,10 +376,10 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     EXPECT_GT(refusals, 0);
     before = readings;
 
-    // mgmtd goes: all stays, and the next one is found without help.
+    // Without mgmtd the view stays as it is, and a new mgmtd is found.
     stop_mgmtd();
     ASSERT_TRUE(wait_until([&] { return !mgmt_link_is_open(link); }));
-    mgmt_link_group_leaves(link, 51, "nobody hears it");
+    mgmt_link_group_leaves(link, 51, "without a session");
     EXPECT_EQ(readings, before);
     start_mgmtd();
     set(NODE_GROUP_CONFIG "/51/interface", "lo");
@@ -390,7 +391,7 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
 TEST_F(Session, AnswersForItsStateAndReports) {
     start_mgmtd();
     ASSERT_TRUE(wait_until([&] { return readings == 1; })) << said;
-    // A further session on mgmtd's side, whose answers are read from the frames.
+    // A second session of mgmtd, whose answers are read from the frames.
     std::vector<std::string> found;
     server_peer_opened(daemon.get(), WCCPD + 1, "mgmtctl-2");
     const auto send = daemon->send;
@@ -427,12 +428,12 @@ TEST_F(Session, AnswersForItsStateAndReports) {
     for (const char *none : {NODE_TUNNEL_STATE "/4/index", NODE_TUNNEL_STATE})
         EXPECT_EQ(ask(none, bn_query_get, 0), strings{"code 0"});
 
-    // Above both daemons: each is asked, one after the other.
+    // A query for nodes of both daemons.
     const strings all = ask("/qv", bn_query_iterate, bn_qf_subtree | bn_qf_leaves_only);
     EXPECT_EQ(std::count(all.begin(), all.end(), NODE_PLANE_STATE "/name=table"), 1);
     EXPECT_EQ(std::count(all.begin(), all.end(), NODE_TUNNEL_STATE "/3/index=7"), 1);
 
-    // Its orderly end is news, unless mgmtd has started it and sees the end itself.
+    // mgmtd reports an orderly end, unless it has started the process and sees the end itself.
     const auto ends_are = [&](size_t count) {
         size_t found_lines = 0;
         for (size_t at = 0; (at = said.find("process tunneld: " EVENT_PROCESS_TERMINATE, at)) != said.npos;
@@ -453,7 +454,7 @@ TEST_F(Session, AnswersForItsStateAndReports) {
 // --- Health
 
 namespace {
-// A server that is told what it does with each connection.
+// A server on loopback that answers each request with `answer`.
 struct proxy {
     int listener;
     uint16_t port = 0;
@@ -529,7 +530,7 @@ struct Health : Loop {
         chmod(path("check").c_str(), 0755);
         return path("check");
     }
-    // The state after the first result of a check that has just been set.
+    // Sets a check and returns the state after its first result.
     std::string first_result(const health_check &check, uint16_t port) const {
         health_set_checks(monitor, {});
         watch(check, port);
@@ -588,7 +589,7 @@ TEST_F(Health, EachKindOfCheckHasItsReasons) {
     EXPECT_EQ(first_result({check_kind::command, script("kill -9 $$"), 1, 1, 1}, 1), "ended by SIGKILL");
     EXPECT_EQ(first_result({check_kind::command, path("none"), 1, 1, 1}, 1),
               path("none") + ": No such file or directory");
-    // Killed with all that it has started, at its end and when its time is over.
+    // A command's children are killed when it ends, and when its time is up.
     for (const auto &[content, result] : {std::pair{"sleep 100 & echo $! >PID", "up"},
                                           {"sleep 100 & echo $! >PID; wait", "no answer in 1000 ms"}}) {
         std::string text = content;
@@ -636,26 +637,27 @@ TEST(Course, WeightsLimitsAndDrainsFollowTheFacts) {
             f->alone = alone;
         });
     };
-    // The first step waits for the routers.
+    // The first step lasts until the group is active.
     EXPECT_EQ(look("before it joins", idle), "20");
     std::string steps;
     for (int i = 0; i <= 41; i++)
         if (const std::string now = look("slow start", works); !steps.ends_with(now + " "))
             steps += now + " ";
     EXPECT_EQ(steps, "20 40 60 80 100 ");
-    // A wccpd that is started anew in time is none; a proxy that comes up is.
+    // There is no slow start for a wccpd that is restarted in time, but there is one after the proxy was
+    // down.
     for (int i = 0; i < 29; i++)
         EXPECT_EQ(look("without wccpd", idle), "100");
     EXPECT_EQ(look("joined again", works), "100");
     EXPECT_EQ(look("proxy down", with([](course_facts *f) { f->proxy_up = false; })), "20");
     EXPECT_EQ(look("without a slow start", with([](course_facts *f) { f->slow_start_s = 0; })), "100");
     EXPECT_EQ(look("and with it again", works), "100");
-    // Above the limit, until below nine tenths of it.
+    // Overload begins above the limit and ends below 90 % of it.
     EXPECT_EQ(look("limit", has(100)), "100");
     EXPECT_EQ(look("limit", has(101)), "100 overloaded");
     EXPECT_EQ(look("limit", has(90)), "100 overloaded");
     EXPECT_EQ(look("limit", has(89)), "100");
-    // Empty: twice none, after the table has moved; that takes a while where it can't be seen.
+    // Empty: two counts of 0 after the table has changed, or after 20 s if that is not visible.
     EXPECT_EQ(look("drain", drains(1, false, false)), "20");
     EXPECT_EQ(look("drain", drains(0, false, false)), "20");
     EXPECT_EQ(look("drain", drains(0, false, false)), "20 empty");
@@ -667,13 +669,13 @@ TEST(Course, WeightsLimitsAndDrainsFollowTheFacts) {
     for (int i = 0; i <= 20; i++)
         EXPECT_EQ(look("still has buckets", drains(0, true, false)), "20");
     EXPECT_EQ(look("long enough", drains(0, true, false)), "20 empty");
-    // A group that is found at work is not slowed down.
+    // A group that was active before tunneld started has no slow start.
     one = {};
     EXPECT_EQ(look("taken over", works), "100");
 }
 
 TEST(Flows, AreCountedOnceForEachGroup) {
-    // Of a proxy that keeps the client's address both ends of a flow are transparent.
+    // If the proxy keeps the client's address, its sockets on both sides are transparent.
     const std::vector<flow_ends> made = {
         {0x0a020002, 0x0a010080, 80, 40000}, {0x0a020002, 0x0a010080, 80, 40001},
         {0x0a010080, 0x0a020002, 50000, 80}, {0x0a020002, 0x0a010081, 8080, 40000},

@@ -1,5 +1,5 @@
-// The sorting rules on the kernel itself: packets come in by TUN devices in the place of a link, of an L2
-// interface and of the way to the clients, and a proxy's sockets listen.
+// The sorting rules in the kernel. TUN devices stand for a link, an L2 interface, the default route and a
+// link to another appliance; a proxy's sockets listen.
 
 #include <arpa/inet.h>
 #include <fcntl.h>
@@ -24,14 +24,15 @@
 
 namespace {
 
+constexpr sorted_as TO_PROXY = SORTED_TO_PROXY, RETURNED = SORTED_RETURNED;
 constexpr uint8_t FIN = 1, SYN = 2, ACK = 16;
 constexpr uint32_t CLIENT = 0xAC100005, SERVER = 0xC6336405, OWN = 0x0A000001, ROUTER = 0xC0000201;
-constexpr uint32_t SPARED = 0x0A090101, BYPASSED = 0xCB007107; // in a group's bypass, in that of all
+constexpr uint32_t SPARED = 0x0A090101, BYPASSED = 0xCB007107; // bypassed for a group, and for all
 
 struct packet {
     uint32_t source = CLIENT, destination = SERVER;
     uint8_t protocol = 6, flags = SYN;
-    uint16_t port = 80, from = 0; // 0: one that no other packet has had
+    uint16_t port = 80, from = 0; // 0: one that was not used before
     uint32_t sequence = 1, acknowledged = 0;
     std::string text = "";
 };
@@ -118,8 +119,8 @@ void give(device where, const std::string &bytes) {
     ASSERT_EQ(write(devices[where], bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
 }
 
-// The next packet out of any device that `wanted` takes. What becomes of a packet is settled when it has been
-// written, up to the answer: the wait is for a busy machine.
+// The next packet from any device that `wanted` accepts. The kernel handles a packet, including the answer,
+// while it is written: waiting is necessary only on a busy machine.
 std::string take(const std::function<bool(const std::string &)> &wanted, device *out_where, int ms = 60) {
     pollfd fds[DEVICES];
     for (int i = 0; i < DEVICES; i++)
@@ -168,7 +169,7 @@ wanted_sorting make_wanted() {
     wanted.l2_interfaces = {"lan0"};
     wanted.members = {"wccp9"};
     wanted.groups = {make_group(5, 6, {{80, 80}, {8000, 8080}}), make_group(6, 17, {{53, 53}}),
-                     make_group(7, 6, {{8040, 8100}})}; // in part taken by group 5
+                     make_group(7, 6, {{8040, 8100}})}; // group 5 has some of these ports
     wanted.groups[0].interfaces = {"wccp0", "lan0"};
     wanted.groups[0].rules.bypass = {{SPARED, 16}, {SPARED, 24}};
     wanted.bypasses = {{BYPASSED, 24}, {BYPASSED, 32}};
@@ -216,8 +217,8 @@ struct Sorting : testing::Test {
         EXPECT_TRUE(read_sorting_counters(&read, &error)) << error;
         return read;
     }
-    // Gives a packet, and says what came of it: the device that it came out of, "answer" from the proxy's TCP
-    // socket, "datagram" at the UDP socket, or "".
+    // Sends a packet and returns the result: the device from which it was read, "answer" or "refused" for a
+    // reply of a TCP socket, "datagram" for the UDP socket, or "".
     static std::string send(packet what, device by = LINK, std::string *out_answer = nullptr) {
         if (what.from == 0)
             what.from = next_port++;
@@ -252,199 +253,110 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
         w.groups[0].pass_marks.assign(8, 0);
         w.groups[0].pass_marks[CLIENT & 7] = PASSED_ON;
     };
+    static const auto choose_passing = [](W &w) {
+        pass_group_5(w);
+        w.members.swap(w.passing);
+    };
     static const auto pass_answers = [](W &w) {
         w.groups[1].rules = {};
         w.groups[1].mask = {0, 4, 0, 0};
         w.groups[1].pass_ports = {{79, 80}, {80, 81}};
         w.groups[1].pass_marks = {0, PASSED_ON};
     };
+    static const auto take_all_ports = [](W &w) { w.groups[0].rules.ports.clear(); };
+    static const auto return_by_gre = [](W &w) { w.l2_into_gre = {{"lan0", MARK_RETURN}}; };
+    static const auto bypass_client = [](W &w) { w.bypasses = {{CLIENT, 32}}; };
+    static const auto bypass_all = [](W &w) { w.bypasses = {{0, 0}}; };
+    static const auto end_proxy = [](W &w) { w.groups[0].condition.proxy_up = false; };
+    static const auto fail_closed = [](W &w) {
+        w.groups[0].condition.proxy_up = false, w.groups[0].rules.drop_when_down = true;
+    };
+    static const auto deactivate = [](W &w) {
+        w.groups[0].condition.active = false, w.groups[0].rules.drop_when_down = true;
+    };
+    static const auto use_free_port = [](W &w) { w.groups[0].rules.to = 3999; };
+    static const auto use_loopback = [](W &w) { w.groups[0].rules.to = 3129; };
+    static const auto forward_rest = [](W &w) {
+        for (auto &g : w.groups)
+            g.rules.rest = leftover::forward;
+    };
+    static const auto drop_rest = [](W &w) { w.groups[0].rules.rest = leftover::drop; };
+    static const auto drop_beside_idle = [](W &w) {
+        w.groups[0].rules.rest = leftover::drop;
+        w.groups[1].rules.to = 0;
+        w.groups[1].interfaces = {"lan0"};
+    };
+    static const auto pass_slot_15 = [](W &w) { // by port 80, the source port, 4 and 1
+        w.groups[0].mask = {1, 4, 0x8000, 16};
+        w.groups[0].pass_marks.assign(16, 0);
+        w.groups[0].pass_marks[15] = PASSED_ON;
+    };
+    static const auto pass_everything = [](W &w) { w.groups[0].pass_marks = {PASSED_ON}; };
+    static const auto clear_groups = [](W &w) { w.groups.clear(); };
     static const struct {
         const char *what;
-        std::function<void(W &)> change;
         packet given;
         device by;
         const char *outcome;
         sorted_as way;
-        int group; // whose counter counts it as well; 0: none
+        int group; // that counts it as well; 0: none
+        std::function<void(W &)> change = [](W &) {};
     } rows[] = {
-        {"a new flow", {}, {}, LINK, "answer", SORTED_TO_PROXY, 5},
-        {"taken by the first group", {}, {.port = 8040}, LINK, "answer", SORTED_TO_PROXY, 5},
-        {"left for the second", {}, {.port = 8100}, LINK, "answer", SORTED_TO_PROXY, 7},
-        {"a datagram", {}, {.protocol = 17, .port = 53}, LINK, "datagram", SORTED_TO_PROXY, 6},
-        {"another port", {}, {.port = 443}, LINK, "wccp0", SORTED_RETURNED, 0},
-        {"another protocol", {}, {.protocol = 47}, LINK, "wccp0", SORTED_RETURNED, 0},
-        {"an older flow", {}, {.flags = ACK}, LINK, "wccp0", SORTED_RETURNED, 5},
-        {"all ports",
-         [](W &w) { w.groups[0].rules.ports.clear(); },
-         {.port = 65535},
-         LINK,
-         "answer",
-         SORTED_TO_PROXY,
-         5},
-        {"by L2", {}, {}, LAN, "answer", SORTED_TO_PROXY, 5},
-        {"by L2, another port", {}, {.port = 443}, LAN, "out0", SORTED_RETURNED, 5},
-        {"by L2, back through GRE",
-         [](W &w) {
-             w.l2_into_gre = {{"lan0", MARK_RETURN}};
-         },
-         {.port = 443},
-         LAN,
-         "wccp0",
-         SORTED_RETURNED,
-         5},
-        {"by L2, to this host", {}, {.destination = OWN}, LAN, "refused", SORTED_WAYS, 0},
-        {"a spared server", {}, {.destination = SPARED}, LINK, "wccp0", SORTED_BYPASSED, 5},
-        {"a spared client", {}, {.source = SPARED}, LINK, "wccp0", SORTED_BYPASSED, 5},
-        {"a bypassed server", {}, {.destination = BYPASSED}, LINK, "wccp0", SORTED_BYPASSED, 0},
-        {"no bypass any more",
-         [](W &w) {
-             w.bypasses = {{CLIENT, 32}};
-         },
-         {.source = BYPASSED},
-         LINK,
-         "answer",
-         SORTED_TO_PROXY,
-         5},
-        {"everything bypassed",
-         [](W &w) {
-             w.bypasses = {{0, 0}};
-         },
-         {},
-         LINK,
-         "wccp0",
-         SORTED_BYPASSED,
-         0},
-        {"proxy down",
-         [](W &w) { w.groups[0].condition.proxy_up = false; },
-         {},
-         LINK,
-         "wccp0",
-         SORTED_DOWN,
-         5},
-        {"fail closed",
-         [](W &w) { w.groups[0].condition.proxy_up = false, w.groups[0].rules.drop_when_down = true; },
-         {},
-         LINK,
-         "",
-         SORTED_DOWN,
-         5},
-        {"not active",
-         [](W &w) { w.groups[0].condition.active = false, w.groups[0].rules.drop_when_down = true; },
-         {},
-         LINK,
-         "wccp0",
-         SORTED_DOWN,
-         5},
-        {"nobody listens", [](W &w) { w.groups[0].rules.to = 3999; }, {}, LINK, "wccp0", SORTED_RETURNED, 5},
-        {"a proxy on loopback",
-         [](W &w) { w.groups[0].rules.to = 3129; },
-         {},
-         LINK,
-         "answer",
-         SORTED_TO_PROXY,
-         5},
-        {"own traffic", {}, {.source = OWN}, LINK, "wccp0", SORTED_OWN, 0},
-        {"forwarded",
-         [](W &w) {
-             for (auto &g : w.groups)
-                 g.rules.rest = leftover::forward;
-         },
-         {.port = 443},
-         LINK,
-         "out0",
-         SORTED_FORWARDED,
-         0},
-        {"dropped",
-         [](W &w) { w.groups[0].rules.rest = leftover::drop; },
-         {.port = 443},
-         LAN,
-         "",
-         SORTED_DROPPED,
-         5},
-        {"not all groups drop",
-         [](W &w) { w.groups[0].rules.rest = leftover::drop; },
-         {.port = 443},
-         LINK,
-         "wccp0",
-         SORTED_RETURNED,
-         0},
-        {"one without an intercept",
-         [](W &w) {
-             w.groups[0].rules.rest = leftover::drop;
-             w.groups[1].rules.to = 0;
-             w.groups[1].interfaces = {"lan0"};
-         },
-         {.port = 443},
-         LAN,
-         "out0",
-         SORTED_RETURNED,
-         0},
-        {"another appliance's flow", pass_group_5, {.flags = ACK}, LINK, "wccp9", SORTED_PASSED, 5},
-        {"the same by L2", pass_group_5, {.flags = ACK}, LAN, "wccp9", SORTED_PASSED, 5},
-        {"of another slot",
-         pass_group_5,
-         {.source = CLIENT + 1, .flags = ACK},
-         LINK,
-         "wccp0",
-         SORTED_RETURNED,
-         5},
-        {"a new flow in that slot", pass_group_5, {}, LINK, "answer", SORTED_TO_PROXY, 5},
-        {"passed on to this appliance, which would pass it on",
-         pass_group_5,
-         {.flags = ACK},
-         MEMBER,
-         "wccp0",
-         SORTED_RETURNED,
-         0},
-        {"the plane's choice, without a socket",
-         [](W &w) {
-             pass_group_5(w);
-             w.members.swap(w.passing);
-         },
-         {.flags = ACK},
-         MEMBER,
-         "wccp0",
-         SORTED_PASSED,
-         0},
-        {"by all four fields", // 80, the source port, 4 and 1: the bits of slot 15
-         [](W &w) {
-             w.groups[0].mask = {1, 4, 0x8000, 16};
-             w.groups[0].pass_marks.assign(16, 0);
-             w.groups[0].pass_marks[15] = PASSED_ON;
-         },
-         {.flags = ACK, .from = 40000},
-         LINK,
-         "wccp9",
-         SORTED_PASSED,
-         5},
-        {"one slot for all",
-         [](W &w) { w.groups[0].pass_marks = {PASSED_ON}; },
-         {.flags = ACK},
-         LINK,
-         "wccp9",
-         SORTED_PASSED,
-         5},
+        {"a new flow", {}, LINK, "answer", TO_PROXY, 5},
+        {"taken by the first group", {.port = 8040}, LINK, "answer", TO_PROXY, 5},
+        {"left for the second", {.port = 8100}, LINK, "answer", TO_PROXY, 7},
+        {"a datagram", {.protocol = 17, .port = 53}, LINK, "datagram", TO_PROXY, 6},
+        {"another port", {.port = 443}, LINK, "wccp0", RETURNED, 0},
+        {"another protocol", {.protocol = 47}, LINK, "wccp0", RETURNED, 0},
+        {"an older flow", {.flags = ACK}, LINK, "wccp0", RETURNED, 5},
+        {"all ports", {.port = 65535}, LINK, "answer", TO_PROXY, 5, take_all_ports},
+        {"by L2", {}, LAN, "answer", TO_PROXY, 5},
+        {"by L2, another port", {.port = 443}, LAN, "out0", RETURNED, 5},
+        {"by L2, back through GRE", {.port = 443}, LAN, "wccp0", RETURNED, 5, return_by_gre},
+        {"by L2, to this host", {.destination = OWN}, LAN, "refused", SORTED_WAYS, 0},
+        {"a spared server", {.destination = SPARED}, LINK, "wccp0", SORTED_BYPASSED, 5},
+        {"a spared client", {.source = SPARED}, LINK, "wccp0", SORTED_BYPASSED, 5},
+        {"a bypassed server", {.destination = BYPASSED}, LINK, "wccp0", SORTED_BYPASSED, 0},
+        {"no bypass any more", {.source = BYPASSED}, LINK, "answer", TO_PROXY, 5, bypass_client},
+        {"everything is bypassed", {}, LINK, "wccp0", SORTED_BYPASSED, 0, bypass_all},
+        {"proxy down", {}, LINK, "wccp0", SORTED_DOWN, 5, end_proxy},
+        {"fail closed", {}, LINK, "", SORTED_DOWN, 5, fail_closed},
+        {"not active", {}, LINK, "wccp0", SORTED_DOWN, 5, deactivate},
+        {"nobody listens", {}, LINK, "wccp0", RETURNED, 5, use_free_port},
+        {"a proxy on loopback", {}, LINK, "answer", TO_PROXY, 5, use_loopback},
+        {"own traffic", {.source = OWN}, LINK, "wccp0", SORTED_OWN, 0},
+        {"forwarded", {.port = 443}, LINK, "out0", SORTED_FORWARDED, 0, forward_rest},
+        {"dropped", {.port = 443}, LAN, "", SORTED_DROPPED, 5, drop_rest},
+        {"not all groups drop", {.port = 443}, LINK, "wccp0", RETURNED, 0, drop_rest},
+        {"one without an intercept", {.port = 443}, LAN, "out0", RETURNED, 0, drop_beside_idle},
+        {"a flow to be passed on", {.flags = ACK}, LINK, "wccp9", SORTED_PASSED, 5, pass_group_5},
+        {"the same by L2", {.flags = ACK}, LAN, "wccp9", SORTED_PASSED, 5, pass_group_5},
+        {"of another slot", {.source = CLIENT + 1, .flags = ACK}, LINK, "wccp0", RETURNED, 5, pass_group_5},
+        {"a new flow in that slot", {}, LINK, "answer", TO_PROXY, 5, pass_group_5},
+        {"passed on to this appliance", {.flags = ACK}, MEMBER, "wccp0", RETURNED, 0, pass_group_5},
+        {"chosen by the plane", {.flags = ACK}, MEMBER, "wccp0", SORTED_PASSED, 0, choose_passing},
+        {"by all four fields", {.flags = ACK, .from = 40000}, LINK, "wccp9", SORTED_PASSED, 5, pass_slot_15},
+        {"one slot for all", {.flags = ACK}, LINK, "wccp9", SORTED_PASSED, 5, pass_everything},
         {"an answer",
-         pass_answers,
          {.flags = ACK, .port = 50000, .from = 81},
          LINK,
          "wccp9",
          SORTED_PASSED,
-         6},
-        {"not of a wanted port",
-         pass_answers,
+         6,
+         pass_answers},
+        {"another answer",
          {.flags = ACK, .port = 50000, .from = 82},
          LINK,
          "wccp0",
-         SORTED_RETURNED,
-         0},
-        {"no groups", [](W &w) { w.groups.clear(); }, {}, LINK, "wccp0", SORTED_RETURNED, 0},
+         RETURNED,
+         0,
+         pass_answers},
+        {"no groups", {}, LINK, "wccp0", RETURNED, 0, clear_groups},
     };
     for (const auto &row : rows) {
         SCOPED_TRACE(row.what);
         wanted_sorting wanted = make_wanted();
-        if (row.change)
-            row.change(wanted);
+        row.change(wanted);
         apply(wanted);
         sorting_counters before = counters();
         EXPECT_EQ(send(row.given, row.by), row.outcome);
@@ -470,9 +382,9 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
     packet next{.from = next_port++};
     std::string answer;
     ASSERT_EQ(send(next, LINK, &answer), "answer");
-    EXPECT_EQ(get(answer, 40, 4), 0x02040000u | wanted.mss); // the option of a SYN-ACK that fits the tunnel
+    EXPECT_EQ(get(answer, 40, 4), 0x02040000u | wanted.mss); // the segment size fits the tunnel
     EXPECT_EQ(counters().clamped, 1);
-    // Its other packets need no rule of a group.
+    // Later packets of the flow don't depend on the group's rules.
     wanted.groups[0].condition.proxy_up = false;
     wanted.bypasses = {{0, 0}};
     wanted.groups[0].pass_marks = {PASSED_ON};
@@ -481,22 +393,22 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
     next.sequence = 2;
     next.acknowledged = get(answer, 24, 4) + 1;
     EXPECT_EQ(send(next, MEMBER), ""); // from another appliance
-    EXPECT_EQ(counters().interfaces["wccp9"][SORTED_TO_PROXY].packets, 1);
+    EXPECT_EQ(counters().interfaces["wccp9"][TO_PROXY].packets, 1);
     next.text = "hello";
     EXPECT_EQ(send(next), "refused"); // acknowledged
     const int flow = accept(listener, nullptr, nullptr);
     char buffer[16];
     EXPECT_EQ(recv(flow, buffer, sizeof(buffer), 0), 5);
-    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_TO_PROXY].packets, 2);
-    // The proxy closes first, and what remains of the flow is no whole socket: the client's FIN belongs to
-    // it. A next flow from the same port is the proxy's again, or is told that the old one isn't over.
+    EXPECT_EQ(counters().interfaces["wccp0"][TO_PROXY].packets, 2);
+    // The proxy closes first, which leaves a TIME_WAIT socket: the client's FIN belongs to it. A new flow
+    // from the same port goes to the proxy, too, or gets an acknowledgement of the old flow.
     close(flow);
     next.sequence += 5;
     next.acknowledged++;
     next.text = "";
     next.flags = FIN | ACK;
     send(next);
-    EXPECT_EQ(counters().interfaces["wccp0"][SORTED_TO_PROXY].packets, 3);
+    EXPECT_EQ(counters().interfaces["wccp0"][TO_PROXY].packets, 3);
     next.flags = SYN;
     next.sequence += 100000;
     EXPECT_EQ(send(next), "refused");
@@ -528,7 +440,7 @@ TEST_F(Sorting, TheProxysOwnFlowIsKnownAgain) {
     EXPECT_EQ(take(is_its_own, &where).size(), syn.size());
     EXPECT_EQ(where, LINK);
     EXPECT_EQ(counters().interfaces["wccp0"][SORTED_OWN].packets, 1);
-    EXPECT_EQ(send({}), "answer"); // others of the same addresses are not
+    EXPECT_EQ(send({}), "answer"); // other flows between these addresses are not
     close(client);
 }
 
@@ -551,13 +463,13 @@ TEST_F(Sorting, OuterPacketsAreCounted) {
     sorting_counters read = counters();
     EXPECT_EQ(read.fragments, (std::map<tunnel_ends, uint64_t>{{{OWN, ROUTER}, 4}}));
     EXPECT_EQ(read.refused_sources, (std::map<uint32_t, uint64_t>{{ROUTER + 1, 1}}));
-    wanted.ends.push_back({OWN, ROUTER + 1}); // is accepted from now on
+    wanted.ends.push_back({OWN, ROUTER + 1}); // now it is accepted
     apply(wanted);
     EXPECT_TRUE(counters().refused_sources.empty());
 }
 
-// What a killed tunneld has left is taken over with its counters; a change that the kernel refuses changes
-// nothing; a table that somebody else has removed comes back.
+// The table of a killed tunneld is taken over with its counters. A change that the kernel refuses has no
+// effect. A table that was removed is made again.
 TEST_F(Sorting, ChangesAreWholeOrNone) {
     wanted_sorting wanted = make_wanted();
     wanted.members.clear();
@@ -578,8 +490,8 @@ TEST_F(Sorting, ChangesAreWholeOrNone) {
     ASSERT_EQ(status, 0);
     apply(wanted);
     sorting_counters read = counters();
-    EXPECT_EQ(read.interfaces["wccp0"][SORTED_TO_PROXY].packets, 2);
-    EXPECT_EQ(read.groups[5][SORTED_TO_PROXY].packets, 1);
+    EXPECT_EQ(read.interfaces["wccp0"][TO_PROXY].packets, 2);
+    EXPECT_EQ(read.groups[5][TO_PROXY].packets, 1);
     EXPECT_EQ(read.interfaces.size(), 2);
     EXPECT_FALSE(read.groups.contains(9));
     EXPECT_EQ(send({.port = 443}), "wccp0");
@@ -599,15 +511,15 @@ TEST_F(Sorting, ChangesAreWholeOrNone) {
     EXPECT_EQ(send({}), "answer");
     apply(wanted);
     EXPECT_EQ(send({}), "wccp0");
-    EXPECT_EQ(counters().groups[5][SORTED_TO_PROXY].packets, 3);
+    EXPECT_EQ(counters().groups[5][TO_PROXY].packets, 3);
 
-    for (int round = 0; round < 2; round++) { // with a difference to make, then without
+    for (int round = 0; round < 2; round++) { // with a change of the rules, then without one
         ASSERT_TRUE(run_nft("flush ruleset", &error)) << error;
         wanted.groups[0].condition.proxy_up = true;
         apply(wanted);
         EXPECT_EQ(send({}), "answer");
     }
-    // A table of that name with something else in it gives way.
+    // A table of the same name with other content is replaced.
     EXPECT_TRUE(remove_sorting_rules(&error)) << error;
     ASSERT_TRUE(run_nft("add table ip tunneld\nadd map ip tunneld arrivals { type ipv4_addr : verdict; }\n"
                         "add set ip tunneld classes { type mark; }\n",
@@ -620,7 +532,7 @@ TEST_F(Sorting, ChangesAreWholeOrNone) {
     EXPECT_EQ(probe_sorting_rules(), "");
 }
 
-// Also where each link has groups of its own.
+// First with the same groups for all links, then with different ones.
 TEST_F(Sorting, ManyLinksAndGroupsAreQuick) {
     for (const bool different : {false, true}) {
         wanted_sorting wanted = make_wanted();
@@ -638,7 +550,7 @@ TEST_F(Sorting, ManyLinksAndGroupsAreQuick) {
                 if (!different || (i >> link % 8 & 1) != link / 8 % 2)
                     wanted.groups[i].interfaces.push_back("wccp" + std::to_string(link));
         }
-        // Processor time, the kernel's with it: other programs may have the machine.
+        // Processor time, including the kernel's, does not depend on other programs.
         const auto timed = [&](const char *what, double limit_ms, const std::function<void()> &act) {
             const clock_t begin = clock();
             act();

@@ -1,5 +1,5 @@
-// tunneld as wccpd sees it: a test plays wccpd's side of the mailbox by hand. The program as a whole is run
-// without mgmtd here, and with it in the scenarios.
+// tunneld as wccpd sees it: the tests write wccpd's side of the mailbox. The complete program runs without
+// mgmtd here, and with it in the scenarios.
 
 #include <gtest/gtest.h>
 #include <net/if.h>
@@ -29,7 +29,7 @@ using namespace std::chrono_literals;
 
 namespace {
 
-wccp_tunnel_mailbox *mailbox; // wccpd's own view of the block
+wccp_tunnel_mailbox *mailbox; // wccpd's mapping
 
 void give(uint16_t code, uint16_t id, uint32_t remote) {
     mailbox->command = 0;
@@ -88,7 +88,7 @@ command_desk Tunneld::before_wccpd;
 
 } // namespace
 
-// First of all, while this process has attached nothing: the child has shared memory of its own.
+// Has to be the first test: the mailbox is not attached yet. The child has its own shared memory.
 TEST(Mailbox, ABlockThatIsTooShortIsNotUsed) {
     write_mem_conf();
     const pid_t child = fork();
@@ -113,15 +113,15 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
     const command_options does = {.first_index = 7}, refuses = {.refuse = true},
                           without_index = {.first_index = WCCP_NO_INDEX}, is_silent = {.silent = true};
     const struct {
-        const command_options *options; // of a daemon that starts here
+        const command_options *options; // set: a new daemon starts with them
         uint16_t code, id;
-        uint32_t remote, status, index; // index: what the mailbox holds then
-        std::string said;               // of a tunnel, after what it is
+        uint32_t remote, status, index; // index: in the mailbox afterwards
+        std::string said;               // printed; for tunnels after their description
     } steps[] = {
         {&does, ADD, 300, 2, 0, 7, "done"},
         {nullptr, ADD, 301, 3, 0, 8, "done"},
         {nullptr, ADD, 300, 2, 0, 7, "done"},
-        // The same ends under another id, and another tunnel under an id: what was there is replaced.
+        // A tunnel with the same ends or the same id is replaced.
         {nullptr, ADD, 305, 2, 0, 9, "done"},
         {nullptr, ADD, 301, 9, 0, 10, "done"},
         {nullptr, DELETE, 305, 2, 0, 9, "done"},
@@ -132,7 +132,7 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
         {&refuses, ADD, 306, 2, 1, NONE, "refused"},
         {&without_index, ADD, 306, 2, 0, NONE, "done, without an index"},
         {&is_silent, ADD, 306, 2, 77, NONE, "not answered"},
-        {nullptr, ADD, 306, 2, 77, NONE, ""}, // printed once
+        {nullptr, ADD, 306, 2, 77, NONE, ""}, // was printed already
     };
     mailbox->l2_group = 51;
     mailbox->l2_value = 1;
@@ -160,7 +160,7 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
     EXPECT_EQ(desk.tunnels.at(301).remote, 0x0A000009u);
 }
 
-// A command that wccpd takes back while it is carried out: an answer would be taken for another command's.
+// wccpd withdraws a command that is being executed. It would take an answer for that of another command.
 TEST_F(Tunneld, ACommandThatWasGivenUpGetsNoAnswer) {
     start_commands(&desk, {.slow_ms = 60}, out);
     static const struct {
@@ -188,7 +188,7 @@ TEST_F(Tunneld, ACommandThatWasGivenUpGetsNoAnswer) {
     }
 }
 
-// The tunnels as somebody else makes them: each change of the table is applied, also the undoing of an add.
+// With `apply`: each change of the table is applied, including the removal of a withdrawn tunnel.
 TEST_F(Tunneld, AppliesEachChangeOfTheTable) {
     std::map<uint16_t, command_tunnel> made;
     uint32_t next = 40;
@@ -202,7 +202,7 @@ TEST_F(Tunneld, AppliesEachChangeOfTheTable) {
     give(MAILBOX_ADD_TUNNEL, 310, 0x0A000002);
     EXPECT_TRUE(take_one(&desk));
     EXPECT_EQ(mailbox->fmst_index, 40u);
-    give(MAILBOX_ADD_TUNNEL, 311, 0x0A000063); // which cannot be made
+    give(MAILBOX_ADD_TUNNEL, 311, 0x0A000063); // fails
     EXPECT_TRUE(take_one(&desk));
     EXPECT_EQ(mailbox->fmst_index, WCCP_NO_INDEX);
     EXPECT_EQ(made.size(), 1u);
@@ -219,12 +219,11 @@ TEST_F(Tunneld, AppliesEachChangeOfTheTable) {
     EXPECT_TRUE(made.empty());
 }
 
-// Tunnels that an older wccpd has ordered. A tunneld that was killed in the middle of an add finds no index
-// in the mailbox either.
+// Tunnels that an earlier wccpd has ordered. The mailbox has no index if tunneld was killed during an add.
 TEST_F(Tunneld, OnlyTunnelsOfAnOlderWccpdHaveToBeOrderedAgain) {
     static const struct {
-        const char *pid; // that the last tunneld has noted, null for none
-        size_t later;    // tunnels that are left after the time to order them
+        const char *pid; // noted by the previous tunneld; null: none
+        size_t later;    // number of tunnels when their time is up
     } rows[] = {{"999999", 1}, {"", 2}, {nullptr, 2}};
     const int64_t now = lt_monotonic_ms();
     for (const auto &row : rows) {
@@ -235,7 +234,7 @@ TEST_F(Tunneld, OnlyTunnelsOfAnOlderWccpdHaveToBeOrderedAgain) {
             forget_wccpd();
         else if (*row.pid)
             std::ofstream(WCCPD_FILE) << row.pid << "\n";
-        give(MAILBOX_ADD_TUNNEL, 300, 0x0A000002); // before anybody has looked for a new wccpd
+        give(MAILBOX_ADD_TUNNEL, 300, 0x0A000002); // before the first watch_wccpd()
         EXPECT_TRUE(take_one(&desk));
         watch_wccpd(&desk, now);
         drop_unordered(&desk, now + UNORDERED_MS - 1000);
@@ -267,7 +266,7 @@ pid_t start_tunneld(int unshared_fd = -1) {
         [unshared_fd] { return close(unshared_fd), run_tunneld({.commands = {}, .plane = "user"}); });
 }
 
-// What an earlier tunneld has left: a tunnel, a further source beside it, and a group with an intercept.
+// Leaves the state of a killed tunneld: a tunnel, an accepted source, and a group with an intercept.
 int leave_a_tunnel() {
     std::string error;
     appliance_view view;
@@ -283,7 +282,7 @@ int leave_a_tunnel() {
     return done ? 0 : 1;
 }
 
-// The maps that packets are sorted by. Nothing stays open that a child could share.
+// The maps of the sorting rules. Closes nft's context, which children would share.
 std::string sorting_maps() {
     nlohmann::json maps;
     std::string error;
@@ -321,7 +320,7 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     EXPECT_EQ(if_nametoindex("wccp0"), tunnel);
     EXPECT_EQ(if_nametoindex("wccp1"), beside);
     EXPECT_EQ(sorting_maps(), maps);
-    // An interface that somebody has removed comes back with the next order, under its new index.
+    // An interface that was removed is made again by the next order, with a new index.
     EXPECT_EQ(system("ip link delete wccp0"), 0);
     const uint32_t again = order(MAILBOX_ADD_TUNNEL, 3, 0x0A000002);
     EXPECT_NE(again, tunnel);
@@ -329,8 +328,7 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     EXPECT_EQ(system("ip route show table 204801 | grep -q 'default dev wccp0'"), 0);
     end_process(daemon, SIGKILL);
 
-    // A link that cannot be taken over yet: wccpd believes in its tunnel, which is made when that is
-    // possible.
+    // A link that cannot be taken over yet is taken over later.
     tun_device held;
     std::string error;
     ASSERT_TRUE(tun_open("wccp0", &held, &error)) << error;
@@ -339,7 +337,8 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     close(held.fd);
     EXPECT_EQ(order(MAILBOX_ADD_TUNNEL, 3, 0x0A000002), again);
     EXPECT_EQ(sorting_maps(), maps);
-    // More wake-ups than its socket takes hold nobody up, and it answers long before it would look by itself.
+    // More wake-ups than its socket can queue don't block the sender, and commands are answered long before
+    // the next regular look at the mailbox.
     const int free_descriptor = dup(0);
     for (int i = 0; i < 1000; i++)
         wccp_wake_tunneld();
@@ -349,7 +348,7 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     EXPECT_LT(lt_monotonic_ms() - began, 1000);
     EXPECT_EQ(end_process(daemon, SIGTERM), 0);
     EXPECT_FALSE(std::filesystem::exists(WCCP_WAKE_UP_PATH));
-    wccp_wake_tunneld(); // nobody
+    wccp_wake_tunneld(); // without a receiver
     close(free_descriptor);
     const int still_free = dup(0);
     EXPECT_EQ(still_free, free_descriptor);
