@@ -17,8 +17,8 @@ enum class link_kind : uint8_t {
     tunnel,   // packets from and to a router
     accepted, // the same for an accepted source of a tunnel
     member,   // packets from and to another appliance, which pass flows on to each other
-    passing,  // sends nothing: by it the kernel gets packets of a member's slots, to look for a socket before
-              // they are passed on
+    passing,  // sends nothing: packets of a member's slots enter the kernel by it, to be passed on to the
+              // member if they have no socket here
 };
 // An interface that is wanted. The interface's alias keeps all of this for the next tunneld.
 struct link_wish {
