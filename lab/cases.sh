@@ -7,7 +7,7 @@
 #     case_two() { ...; }
 #     lab_case                # runs the case that this lab is for
 #
-#   LAB_SIDE_BY_SIDE   how many cases run at a time (default: three for each processor)
+#   LAB_SIDE_BY_SIDE   how many cases run at a time (default: two for each processor)
 
 # shellcheck source=topology.sh
 source "$(dirname "${BASH_SOURCE[0]}")/topology.sh"
@@ -16,7 +16,7 @@ lab_cases() {
     export WCCP_BIN=${1:-$LAB_TOP/build/release/bin}
     if [ "${LAB_INSIDE-}" != 1 ] && [ "${2-}" != --one ]; then
         command -v jq >/dev/null || { echo "jq is not installed"; exit 77; }
-        local cases out case i failed=0 limit=${LAB_SIDE_BY_SIDE:-$((3 * $(nproc)))}
+        local cases out case i failed=0 limit=${LAB_SIDE_BY_SIDE:-$((2 * $(nproc)))}
         mapfile -t cases < <(sed -n 's/^case_\([a-z0-9_]*\)() {.*/\1/p' "$0")
         [ $# -lt 2 ] || cases=("${@:2}")
         out=$(mktemp -d)

@@ -9,7 +9,7 @@ void note_counter(occurrences *inout, const std::string &what, uint64_t total, i
             known.first_ms = now_ms;
         known.last_ms = now_ms;
     }
-    known.total = total; // which is smaller after a counter has begun anew
+    known.total = total; // less than before if the counter was reset
 }
 
 void note_state(occurrences *inout, const std::string &what, bool lasts, int64_t now_ms) {

@@ -1,8 +1,7 @@
-// When things occurred that an operator should know of: packets that a counter has counted, and states that
-// last.
+// Times of events that an operator should know about: packets that a counter has counted, and lasting states.
 //
-// Counters are looked at now and then, and whenever somebody asks for the state; the times are as exact as
-// that. What has not occurred again for OCCURRENCE_MS begins anew when it does.
+// Counters are read every OCCURRENCE_LOOK_MS and at each query of the state, which limits the accuracy of the
+// times. If nothing has occurred for OCCURRENCE_MS, the next occurrence counts as the first.
 #pragma once
 
 #include <cstdint>
@@ -10,15 +9,15 @@
 #include <string>
 
 constexpr int64_t OCCURRENCE_MS = 300000;
-constexpr int64_t OCCURRENCE_LOOK_MS = 10000; // between looks at the counters
+constexpr int64_t OCCURRENCE_LOOK_MS = 10000;
 
 struct occurrence {
-    uint64_t total = 0;                  // of the counter when it was looked at last
+    uint64_t total = 0;                  // of the counter when it was last read
     int64_t first_ms = -1, last_ms = -1; // monotonic; -1: it has not occurred
 };
-using occurrences = std::map<std::string, occurrence>; // by what has occurred
+using occurrences = std::map<std::string, occurrence>; // by the name of the event
 
-// The counter has this value now.
+// Records the present value of a counter.
 void note_counter(occurrences *inout, const std::string &what, uint64_t total, int64_t now_ms);
-// The state lasts, or is over.
+// Records whether a state lasts; one that is over is forgotten.
 void note_state(occurrences *inout, const std::string &what, bool lasts, int64_t now_ms);

@@ -177,7 +177,7 @@ void add_protection(const tunneld &daemon, const plane_counters &plane, const so
     }
 }
 
-// How long ago each began, and was seen last.
+// How long ago each began, and how long ago it occurred last.
 void add_occurrences(const occurrences &occurred, node_writer *writer) {
     const int64_t now = lt_monotonic_ms();
     for (const auto &[what, when] : occurred) {
