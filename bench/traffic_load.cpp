@@ -331,7 +331,8 @@ int run_source(char **words) {
 
 int run_split(char **words) {
     const int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-    for (const uint32_t command : {ETHTOOL_STSO, ETHTOOL_SGSO, ETHTOOL_STXCSUM}) {
+    constexpr uint32_t commands[] = {ETHTOOL_STSO, ETHTOOL_SGSO, ETHTOOL_STXCSUM};
+    for (const uint32_t command : commands) {
         ethtool_value off = {command, 0};
         ifreq request = {};
         snprintf(request.ifr_name, sizeof request.ifr_name, "%s", words[0]);
