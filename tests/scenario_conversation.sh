@@ -153,7 +153,9 @@ case_removal_query() {
     wait_role a1 30 60 ACTIVE
     lab_ctl r1 query 10.0.0.101 >/dev/null
     lab_sleep 4
-    [ "$(tac "$LAB/r1.log" | grep -m1 -B9 removal-query | grep -c '"what":"here-i-am"')" -ge 3 ] || die "not three answers"
+    # To one query at least: the router may have sent the last one just now.
+    awk '/"what":"removal-query"/ { answers = 0 } /"what":"here-i-am"/ && ++answers >= 3 { found = 1 } END { exit !found }' \
+        "$LAB/r1.log" || die "not three answers"
     finish a1
 }
 
