@@ -136,26 +136,26 @@ expect 0 '' delete $G
 expect 0 'created*' set $G/interface=eth0 $G/router/1/ipaddr=10.0.0.1 $G/password=geheim
 lab_wait 60 '.["51"].router["1"].state == "TWO-WAY connected"' lab_state a1 || fail "the group was not created again"
 expect 0 'no alarm is active' alarms --check
-lab_ctl r1 stop >/dev/null
-
-# Until the alarm: pipes, a full device, and shell completion
-
-(ctl walk / | true; exit "${PIPESTATUS[0]}"); [ $? = 141 ] || fail "wrong status for a pipe without a reader"
-ctl walk / >/dev/full 2>"$LAB/complained"; [ $? = 7 ] || fail "wrong status for a full device"
-complains 'mgmtctl: standard output: No space left on device'
 completed() { # WORD... : prints what bash would offer
     lab_in a1 bash -c 'PATH=$1:$PATH; source "$2"; compopt() { :; }; shift 2
         COMP_WORDS=(mgmtctl "$@"); COMP_CWORD=$#; _mgmtctl; echo "${COMPREPLY[*]}"' - "$WCCP_BIN" "$top/packaging/mgmtctl.bash-completion" "$@"
 }
+[ "$(completed al)" = alarms ] && [ "$(completed get "${G%1}")" = $G ] && [ "$(completed group set '')" = 51 ] &&
+    [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&
+    [ "$(completed walk --le)" = --leaves ] || fail "completion of alarms, get, group, set and walk"
+lab_ctl r1 stop >/dev/null
+
+# Until the alarm: pipes, a full device, and completion for intercepts
+
+(ctl walk / | true; exit "${PIPESTATUS[0]}"); [ $? = 141 ] || fail "wrong status for a pipe without a reader"
+ctl walk / >/dev/full 2>"$LAB/complained"; [ $? = 7 ] || fail "wrong status for a full device"
+complains 'mgmtctl: standard output: No space left on device'
 ctl bypass add 10.0.0.0/8 >/dev/null && ctl intercept add 51 all to 3128 >/dev/null || fail "mgmtd refused an intercept"
 [ "$(completed bypass delete 10.0.0.0/)" = 10.0.0.0/8 ] && [ "$(completed intercept set '')" = 51 ] &&
     [ "$(completed intercept set 51 ch)" = check ] && [ "$(completed intercept set 51 rest d)" = drop ] ||
     fail "completion of bypass and intercept"
 expect 0 'jq:.intercepts[0] | .group == 51 and .active == false' --json intercept show 051 # no router has assigned yet
 ctl bypass delete 10.0.0.0/8 >/dev/null; ctl intercept delete 51 >/dev/null
-[ "$(completed al)" = alarms ] && [ "$(completed get "${G%1}")" = $G ] && [ "$(completed group set '')" = 51 ] &&
-    [ "$(completed get "$S/router/")" = "$S/router/1" ] && [ "$(completed set $G/encap = g)" = gre ] &&
-    [ "$(completed walk --le)" = --leaves ] || fail "completion of alarms, get, group, set and walk"
 if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
     as=(setpriv --reuid 65534 --regid 65534 --clear-groups)
     expect 3 '' get $G/weight
