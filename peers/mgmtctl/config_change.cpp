@@ -2,7 +2,7 @@
 // that leaves it out are the same configuration. Only differences are sent. A group that is in both is
 // changed and never deleted and created again.
 //
-// A hidden password, as in an export without --secrets, stands for the present one.
+// A hidden password, as in an export without --secrets, keeps the present one.
 #include "peers/mgmtctl/config_change.h"
 
 #include <set>

@@ -10,8 +10,8 @@
 #include "peers/nodes/config_text.h"
 
 // A configuration in mgmtd's format, or as a JSON object of values by the names of their nodes. A hidden
-// password stands for the one in `present`. With `merge`, nodes that it does not name keep their values of
-// `present`. False with the errors, one in a line.
+// password keeps its value of `present`. With `merge`, so do the nodes that it does not name. False with the
+// errors, one in a line.
 bool read_config(const std::string &content, const std::string &file, const node_tree &present, bool merge,
                  node_tree *out, std::string *out_errors);
 

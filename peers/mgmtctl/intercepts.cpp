@@ -135,8 +135,8 @@ std::string misfit_note(const ctl_link &link, const std::string &number, const s
     const std::string redirected = group.contains("protocol") ? group["protocol"] : "tcp";
     if (protocol_number(redirected) == protocol_number(protocol))
         return "";
-    return "group " + number + " redirects " + redirected + ", of which an intercept of " + protocol +
-           " gets nothing";
+    return "group " + number + " redirects " + redirected + ", and an intercept of " + protocol +
+           " gets none of that";
 }
 } // namespace
 

@@ -118,18 +118,19 @@ int commit_change(const ctl_options &options, const std::vector<ctl_change_item>
         return mgmtd.lost();
     if (reply.code != 0)
         return refused_change(options, &mgmtd, reply, items);
-    const change_notes said = notes_of(items, before);
+    const change_notes changes = notes_of(items, before);
     if (!options.json) {
-        for (const std::string &root : said.created)
+        for (const std::string &root : changes.created)
             put("created " + root + "\n");
-        for (const std::string &note : said.notes)
+        for (const std::string &note : changes.notes)
             fprintf(stderr, "mgmtctl: note: %s\n", note.c_str());
         return CTL_OK;
     }
     ctl_json changed = ctl_json::array();
     for (const ctl_change_item &item : items)
         changed.push_back(item.binding.name);
-    put(json_line({{"changed", changed}, {"created", said.created}, {"notes", said.notes}, {"exit", 0}}));
+    put(json_line(
+        {{"changed", changed}, {"created", changes.created}, {"notes", changes.notes}, {"exit", 0}}));
     return CTL_OK;
 }
 } // namespace

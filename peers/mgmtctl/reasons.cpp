@@ -278,7 +278,7 @@ void add_noted(const std::vector<snapshot_reason> &noted, int group, reason_list
     };
     for (const snapshot_reason &each : noted) {
         if (each.code == "interface-missing" && each.wanted.empty())
-            continue; // the group has no interface: "no-interface" says so
+            continue; // the group has no interface: "no-interface" reports it
         if (each.code == "election-blocked" && is_unlisted(each.sender))
             continue; // follows from "not-in-view"
         reason *made = list->add_reason(each.code.c_str(), group);

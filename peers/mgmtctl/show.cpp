@@ -6,7 +6,7 @@
 // the program. Below rows that belong to another program it takes no screen, hides no cursor, and addresses
 // the beginning of each snapshot, because the other program may have moved the cursor in between. In a file
 // or a pipe it is a line, with the time, for whatever has changed, and as JSON one snapshot a line. When
-// mgmtd goes, a live snapshot reports that and tries to reach it once a second.
+// mgmtd is lost, a live snapshot reports that and tries to reach it once a second.
 //
 // How a snapshot is drawn is a row of the table of renderers.
 #include <algorithm>
@@ -113,7 +113,7 @@ std::string clock_text() {
     return text;
 }
 
-// Of a line that can go: a group or its proxy, whatever it says, an alarm or a note.
+// Identifies a line that can disappear, whatever its text: a group or its proxy, an alarm or a note.
 std::string key_of(const std::string &line) {
     for (const char *kind : {"group ", "proxy of "})
         if (line.starts_with(kind))

@@ -221,7 +221,7 @@ bool gather_routers(gathering *work, snapshot_group *group, const std::vector<st
         else if (parts[3] == "load_dist")
             take_load(group, &group->routers.back(), parts[2], binding.value);
     }
-    // wccpd's numbers change with each that comes or goes; a place on the screen shouldn't.
+    // wccpd's numbers change when a router is added or removed; a place on the screen shouldn't.
     std::sort(group->routers.begin(), group->routers.end(), [](const auto &a, const auto &b) {
         return address_order(a.address) < address_order(b.address);
     });

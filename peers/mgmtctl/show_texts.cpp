@@ -61,7 +61,7 @@ struct assignment_reader {
     bool routers = false; // in the part of what they report
     std::string router;
     int place = -1;
-    int words_at = -1;  // where the next line of words goes, -1: nowhere
+    int words_at = -1;  // where the next line of words is put, -1: nowhere
     int wanted_at = -1; // the same in the designated appliance's table: 128 for the first line, then 0
     bool mask = false;
     std::map<std::string, snapshot_table> tables; // by router
