@@ -68,7 +68,12 @@ bool read_json(const std::string &content, const std::string &file, node_tree *o
     }
     for (const auto &[name, value] : nodes.items())
         if (reason.clear(); !take_json_node(out, name, value, &reason))
-            *out_errors += file + ": " + shown_text(name) + ": " + reason + "\n";
+            out_errors->append(file)
+                .append(": ")
+                .append(shown_text(name))
+                .append(": ")
+                .append(reason)
+                .append("\n");
     return out_errors->empty();
 }
 
