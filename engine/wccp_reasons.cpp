@@ -106,7 +106,7 @@ wccp_reason *find_reason(wccp_service_group *group, wccp_reason_code code, be32 
     return nullptr;
 }
 
-thread_local be32 packet_source; // not the engine's: a thread that waits for tunneld releases the lock
+thread_local be32 packet_source; // of the packet that this thread processes; 0.0.0.0 outside of that
 
 } // namespace
 
