@@ -13,7 +13,8 @@
 source "$(dirname "${BASH_SOURCE[0]}")/topology.sh"
 
 lab_cases() {
-    export WCCP_BIN=${1:-$LAB_TOP/build/release/bin}
+    WCCP_BIN=$(readlink -f "${1:-$LAB_TOP/build/release/bin}")
+    export WCCP_BIN
     if [ "${LAB_INSIDE-}" != 1 ] && [ "${2-}" != --one ]; then
         command -v jq >/dev/null || { echo "jq is not installed"; exit 77; }
         local cases out case i failed=0 limit=${LAB_SIDE_BY_SIDE:-$((2 * $(nproc)))}

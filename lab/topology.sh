@@ -62,6 +62,8 @@
 #   LAB_SPEED   how much faster than real time the protocol runs (default 1): the clock of wccpd, tunneld and
 #               wccp_router (lab/fast_clock.cpp). mgmtd and mgmtctl, whose time limits concern work and not the protocol,
 #               keep real time. SECONDS of all functions are real seconds, except for lab_sleep.
+#   LAB_PATIENCE    by how much the SECONDS of functions that wait are multiplied (default 1), for a slow or busy machine.
+#                   What a test measures itself stays as it is.
 #   LAB_TUNNELD     options that lab_appliance_start passes to tunneld; "none": do not start it
 #   LAB_PLANE       its data plane (default table, which carries no packets); empty: the best that the kernel supports
 #   LAB_LOG_LEVEL   log level of wccpd in the configuration that lab_write_config writes (default info)
@@ -69,7 +71,7 @@
 LAB_HOME=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
 LAB_TOP=$(dirname "$LAB_HOME")
 : "${WCCP_BIN:=$LAB_TOP/build/release/bin}"
-: "${LAB_SPEED:=1}" "${LAB_LOG_LEVEL:=info}" "${LAB_PLANE=table}"
+: "${LAB_SPEED:=1}" "${LAB_PATIENCE:=1}" "${LAB_LOG_LEVEL:=info}" "${LAB_PLANE=table}"
 LAB_CONFIG=/etc/opt/rvl/mgmtd.conf # inside an appliance
 declare -A LAB_INIT LAB_PID        # first process of a node; programs by NODE/NAME
 declare -A LAB_MARKED LAB_FOUND    # log lines before lab_mark; output of lab_remains before the programs started
@@ -116,15 +118,23 @@ lab_set_up() {
     mount -t tmpfs tmpfs $aside || lab_die "cannot mount a file system on $aside"
     LAB=$aside/lab
     mkdir $LAB
+    mkfifo $LAB/pause
     trap 'lab_collect' EXIT
     trap 'exit 130' INT
     trap 'exit 143' TERM HUP
-    ip link set lo up
-    ip link add lan type bridge mcast_snooping 0 forward_delay 0
+    ip -batch - <<'END' || lab_die "no bridge"
+link set lo up
+link add lan type bridge mcast_snooping 0 forward_delay 0
+address add 10.0.0.254/24 dev lan
+link set lan up
+END
     echo 1 >/proc/sys/net/ipv6/conf/all/disable_ipv6 2>/dev/null
     echo 1 >/proc/sys/net/ipv6/conf/default/disable_ipv6 2>/dev/null
-    ip address add 10.0.0.254/24 dev lan
-    ip link set lan up
+}
+
+# Waits like sleep, but without a process: with many labs at a time, those that wait take little from those that work.
+lab_pause() { # SECONDS
+    read -rt "$1" <>"$LAB/pause" || true
 }
 
 lab_collect() {
@@ -135,11 +145,10 @@ lab_collect() {
 
 # Waits until a process has left our namespace of that kind.
 lab_wait_namespace() { # PID KIND
-    local own i
-    own=$(readlink "/proc/$$/ns/$2")
-    for i in $(seq 200); do
-        [ -e "/proc/$1/ns/$2" ] && [ "$(readlink "/proc/$1/ns/$2")" != "$own" ] && return
-        sleep 0.02
+    local i
+    for ((i = 0; i < 200; i++)); do
+        [ -e "/proc/$1/ns/$2" ] && ! [ "/proc/$1/ns/$2" -ef "/proc/$$/ns/$2" ] && return
+        lab_pause 0.02
     done
     lab_die "process $1 has no $2 namespace"
 }
@@ -147,12 +156,14 @@ lab_wait_namespace() { # PID KIND
 # Adds an eth0, connected to the bridge, to the network namespace of a process.
 lab_plug() { # NODE PID ADDRESS...
     local node=$1 pid=$2 address; shift 2
-    ip link add "v-$node" type veth peer name eth0 netns "$pid" || lab_die "no veth for $node"
-    ip link set "v-$node" master lan up
-    nsenter -t "$pid" --net ip link set lo up
-    for address; do nsenter -t "$pid" --net ip address add "$address/24" dev eth0; done
-    nsenter -t "$pid" --net ip link set eth0 up
-    nsenter -t "$pid" --net ip route add default via 10.0.0.254 2>/dev/null
+    ip -batch - <<<"link add v-$node type veth peer name eth0 netns $pid"$'\n'"link set v-$node master lan up" ||
+        lab_die "no veth for $node"
+    {
+        echo 'link set lo up'
+        for address; do echo "address add $address/24 dev eth0"; done
+        echo 'link set eth0 up'
+        echo 'route add default via 10.0.0.254'
+    } | nsenter -t "$pid" --net ip -force -batch - 2>/dev/null
     return 0
 }
 
@@ -164,7 +175,7 @@ lab_router() { # NAME ADDRESS... [-- OPTIONS OF wccp_router]
     lab_bare "$node"
     lab_plug "$node" "${LAB_INIT[$node]}" "${addresses[@]}"
     lab_route_start "$node" "${which[@]}" "$@"
-    lab_redirect "$node"
+    [[ " $* " != *' --redirect '* ]] || lab_redirect "$node"
 }
 # Creates a network namespace, held by a process.
 lab_bare() { # NODE
@@ -221,7 +232,7 @@ lab_server() { # NODE ROUTER [NET]
     local i
     for ((i = 0; i < 100; i++)); do
         [ "$(lab_in "$1" cat /proc/net/tcp | grep -cE ' 0+:(0050|1F90) 0+:0+ 0A')" != 2 ] || return 0
-        sleep 0.05
+        lab_pause 0.05
     done
     lab_die "the web server of $1 did not start"
 }
@@ -235,7 +246,7 @@ lab_proxy() { # NODE [PORT] [keep]
     for ((i = 0; i < 200; i++)); do
         ! lab_in "$1" cat /proc/net/tcp | grep -q "$(printf ' 0*:%04X 0*:0* 0A' "$port")" || return 0
         lab_alive "$1" proxy || break
-        sleep 0.05
+        lab_pause 0.05
     done
     cat "$LAB/$1-proxy.out" >&2
     lab_die "the proxy of $1 did not start"
@@ -247,28 +258,34 @@ lab_route_start() { # NAME OPTIONS... : also after lab_stop NAME router
         </dev/null >>"$LAB/$node.log" 2>&1 &
     LAB_PID[$node/router]=$!
     local i
-    for i in $(seq 100); do
+    for ((i = 0; i < 100; i++)); do
         [ -S "$LAB/$node.ctl" ] && return
         kill -0 $! 2>/dev/null || break
-        sleep 0.05
+        lab_pause 0.05
     done
     cat "$LAB/$node.log" >&2
     lab_die "router $node did not start"
 }
 
+# Sets LAB_CHILD to the first child of a process, or to nothing.
+lab_find_child() { # PID
+    LAB_CHILD=
+    { read -r LAB_CHILD _ <"/proc/$1/task/$1/children"; } 2>/dev/null || true
+}
 # Creates the namespaces of an appliance, with a log daemon as their first process: when it dies, all of them end.
 lab_appliance() { # NAME ADDRESS...
-    local node=$1 outer i; shift
+    local node=$1 outer i comm; shift
     "$LAB_HOME/in-appliance" "$WCCP_BIN/wccp_router" logd - </dev/null >"$LAB/$node.log" 2>"$LAB/$node.out" &
     outer=$!
-    for i in $(seq 200); do
-        LAB_INIT[$node]=$(cat "/proc/$outer/task/$outer/children" 2>/dev/null)
-        LAB_INIT[$node]=${LAB_INIT[$node]%% *}
+    for ((i = 0; i < 200; i++)); do
+        lab_find_child $outer
+        LAB_INIT[$node]=$LAB_CHILD
         # Ready when the log daemon has replaced the shell that set up the namespaces.
-        [ -n "${LAB_INIT[$node]}" ] && [ "$(cat "/proc/${LAB_INIT[$node]}/comm" 2>/dev/null)" = wccp_router ] &&
-            [ -S "/proc/${LAB_INIT[$node]}/root/dev/log" ] && break
+        comm=
+        [ -z "$LAB_CHILD" ] || read -r comm 2>/dev/null <"/proc/$LAB_CHILD/comm"
+        [ "$comm" = wccp_router ] && [ -S "/proc/${LAB_INIT[$node]}/root/dev/log" ] && break
         kill -0 $outer 2>/dev/null || { cat "$LAB/$node.out" >&2; lab_die "appliance $node did not start"; }
-        sleep 0.02
+        lab_pause 0.02
     done
     cp "$LAB_TOP"/packaging/*.conf "/proc/${LAB_INIT[$node]}/root/etc/opt/rvl/" || lab_die "cannot copy the platform files to $node"
     lab_plug "$node" "${LAB_INIT[$node]}" "$@"
@@ -288,13 +305,13 @@ lab_clock() {
     local library
     LAB_CLOCK=()
     [ "$LAB_SPEED" != 1 ] || return 0
-    library=$(dirname "$WCCP_BIN")/lib/libfast_clock.so
+    library=${WCCP_BIN%/*}/lib/libfast_clock.so
     [ -e "$library" ] || lab_die "no $library"
     LAB_CLOCK=(env "LD_PRELOAD=$library" "FAST_CLOCK=$LAB_SPEED"
         "ASAN_OPTIONS=${ASAN_OPTIONS:+$ASAN_OPTIONS:}verify_asan_link_order=0")
 }
 lab_sleep() { # SECONDS : in the time of the protocol
-    sleep "$(awk "BEGIN { print $1 / $LAB_SPEED }")"
+    lab_pause "$(awk "BEGIN { print $1 / $LAB_SPEED }")"
 }
 
 # Starts a program inside an appliance; a name without a slash is one of ours. Its output goes to $LAB/NODE-NAME.out.
@@ -315,8 +332,8 @@ lab_start() { # NODE NAME PROGRAM ARGUMENTS...
 lab_pid() { # NODE NAME
     local pid=${LAB_PID[$1/$2]-}
     [ -n "$pid" ] || lab_die "there is no $2 in $1"
-    if [ "$2" != router ]; then pid=$(cat "/proc/$pid/task/$pid/children" 2>/dev/null); fi
-    echo "${pid%% *}"
+    if [ "$2" != router ]; then lab_find_child "$pid"; pid=$LAB_CHILD; fi
+    echo "$pid"
 }
 lab_alive() { # NODE NAME
     kill -0 "${LAB_PID[$1/$2]}" 2>/dev/null
@@ -325,15 +342,16 @@ lab_alive() { # NODE NAME
 # seconds.
 lab_stop() { # NODE NAME [SIGNAL]
     local pid=${LAB_PID[$1/$2]} inner i
-    inner=$(lab_pid "$1" "$2")
+    lab_find_child "$pid"; inner=$LAB_CHILD
+    [ "$2" != router ] || inner=$pid
     if [ -n "$inner" ]; then
         [ "${3-}" != KILL ] || lab_expect_sockets "$1" "$2" "$inner"
         kill -s "${3-TERM}" "$inner"
         kill -s CONT "$pid" 2>/dev/null # nsenter stops itself when its program is stopped
     fi
-    for i in $(seq 300); do
+    for ((i = 0; i < 300; i++)); do
         kill -0 "$pid" 2>/dev/null || { wait "$pid"; return; }
-        sleep 0.05
+        lab_pause 0.05
     done
     return 124
 }
@@ -352,9 +370,9 @@ lab_expect_sockets() { # NODE NAME PID
 # Waits until a program exits by itself; the result is its status, or 124.
 lab_wait_exit() { # SECONDS NODE NAME
     local i
-    for ((i = 0; i < $1 * 20; i++)); do
+    for ((i = 0; i < $1 * LAB_PATIENCE * 20; i++)); do
         lab_alive "$2" "$3" || { wait "${LAB_PID[$2/$3]}"; return; }
-        sleep 0.05
+        lab_pause 0.05
     done
     return 124
 }
@@ -381,23 +399,31 @@ lab_ctl() { # ROUTER COMMAND... : sends a command to a simulated router
 # Runs a command repeatedly until the jq expression is true for its output. After that many seconds it prints the last
 # output, and the result is 1.
 lab_wait() { # SECONDS EXPRESSION COMMAND...
-    local limit=$1 expression=$2 began=$SECONDS last; shift 2
+    local limit=$(($1 * LAB_PATIENCE)) expression=$2 began=$SECONDS pause=0.2 last='' before=''; shift 2
     while :; do
-        last=$("$@" 2>&1) && jq -e "$expression" <<<"$last" >/dev/null 2>&1 && return 0
+        # jq takes longer to start than anything else here.
+        last=$("$@" 2>&1) && [ "$last" != "$before" ] && jq -e "$expression" <<<"$last" >/dev/null 2>&1 && return 0
+        before=$last
         [ $((SECONDS - began)) -lt "$limit" ] || break
-        sleep 0.2
+        lab_pause $pause
+        [ $((SECONDS - began)) -lt 2 ] || pause=0.5
     done
     echo "lab: not true after $limit s: $expression" >&2
     [ "${#last}" -lt 4000 ] && echo "$last" >&2
     return 1
 }
+# Runs a test repeatedly until it succeeds. The result is 1 if it has not after that many seconds.
+lab_wait_until() { # SECONDS COMMAND...
+    local limit=$(($1 * LAB_PATIENCE)) began=$SECONDS pause=0.1; shift
+    until "$@"; do
+        [ $((SECONDS - began)) -lt "$limit" ] || return 1
+        lab_pause $pause
+        [ $((SECONDS - began)) -lt 2 ] || pause=0.3
+    done
+}
 # Waits for a line in a file.
 lab_wait_line() { # SECONDS EXPRESSION FILE
-    local began=$SECONDS
-    until grep -Eq -- "$2" "$3" 2>/dev/null; do
-        [ $((SECONDS - began)) -lt "$1" ] || { echo "lab: after $1 s no line in $3: $2" >&2; return 1; }
-        sleep 0.2
-    done
+    lab_wait_until "$1" grep -Eqs -- "$2" "$3" || { echo "lab: after $1 s no line in $3: $2" >&2; return 1; }
 }
 
 # --- The programs of an appliance
@@ -468,7 +494,7 @@ lab_wccpd_start() { # NODE
     for ((i = 0; i < 600; i++)); do
         [ "$(grep -c 'wccpd_init: encap entries:' "$LAB/$1.log")" -gt "$before" ] && return
         lab_alive "$1" wccpd || break
-        sleep 0.05
+        lab_pause 0.05
     done
     lab_show_and_die "$1" "wccpd of $1 did not start"
 }
@@ -485,11 +511,11 @@ lab_configure() { # NODE [TEXT]...
     before=$(lab_events "$1" | wc -l)
     lab_write_config "$@" || return
     kill -HUP "$(lab_pid "$1" mgmtd)"
-    for ((i = 0; i < 200; i++)); do
+    for ((i = 0; i < 200 * LAB_PATIENCE; i++)); do
         now=$(lab_events "$1" | tail -n +$((before + 1)))
         [[ $now != *'configuration read again: '* ]] || return 0
         [[ $now != *$LAB_CONFIG:* ]] || break
-        sleep 0.05
+        lab_pause 0.05
     done
     echo "lab: mgmtd of $1 refused the configuration: $now" >&2
     return 1
@@ -498,16 +524,28 @@ lab_configure() { # NODE [TEXT]...
 lab_events() { # NODE
     cat "$LAB/$1-mgmtd.out"
 }
+# Sets LAB_ROLE.
+lab_find_role() { # NODE GROUP
+    local lines i
+    mapfile -t lines <"$LAB/$1-mgmtd.out"
+    LAB_ROLE=
+    for ((i = ${#lines[@]} - 1; i >= 0; i--)); do
+        [[ ${lines[i]} = "role of group $2: "* ]] || continue
+        LAB_ROLE=${lines[i]##*: }
+        return
+    done
+}
 lab_role() { # NODE GROUP
-    lab_events "$1" | sed -n "s/^role of group $2: //p" | tail -n 1
+    lab_find_role "$1" "$2"
+    echo "$LAB_ROLE"
+}
+lab_has_role() { # NODE GROUP ROLE
+    lab_find_role "$1" "$2"
+    [ "$LAB_ROLE" = "$3" ]
 }
 lab_wait_role() { # SECONDS NODE GROUP ROLE
-    local began=$SECONDS
-    until [ "$(lab_role "$2" "$3")" = "$4" ]; do
-        [ $((SECONDS - began)) -lt "$1" ] ||
-            { echo "lab: after $1 s the role of group $3 in $2 is '$(lab_role "$2" "$3")', not $4" >&2; return 1; }
-        sleep 0.1
-    done
+    lab_wait_until "$1" lab_has_role "${@:2}" ||
+        { echo "lab: after $1 s the role of group $3 in $2 is '$LAB_ROLE', not $4" >&2; return 1; }
 }
 lab_wait_event() { # SECONDS NODE EXPRESSION
     lab_wait_line "$1" "$3" "$LAB/$2-mgmtd.out"
@@ -519,12 +557,11 @@ lab_mark() { # NODE
 lab_log() { # NODE
     tail -n +$((${LAB_MARKED[$1]-0} + 1)) "$LAB/$1.log"
 }
+lab_logged() { # NODE EXPRESSION
+    grep -Eq -- "$2" < <(lab_log "$1")
+}
 lab_wait_log() { # SECONDS NODE EXPRESSION
-    local began=$SECONDS
-    until lab_log "$2" | grep -Eq -- "$3"; do
-        [ $((SECONDS - began)) -lt "$1" ] || { echo "lab: after $1 s no line in the log of $2: $3" >&2; return 1; }
-        sleep 0.1
-    done
+    lab_wait_until "$1" lab_logged "${@:2}" || { echo "lab: after $1 s no line in the log of $2: $3" >&2; return 1; }
 }
 
 lab_manage() { # NODE WORDS...
@@ -604,7 +641,7 @@ lab_capture() { # FILE
     lab_wait_line 20 "$ready" "$LAB/capture.out" || { cat "$LAB/capture.out" >&2; return 1; }
 }
 lab_capture_end() {
-    sleep 1.2
+    lab_pause 1.2
     kill -INT "$LAB_CAPTURE"; wait "$LAB_CAPTURE"
 }
 

@@ -62,7 +62,7 @@ list_tidy_sources() { # changed|all
 }
 # Files are analysed one at a time: clang-tidy 14 carries what it has seen of va_lists over from one file to the next.
 run_tidy() { # reads the names of the files
-    cmake --preset asan -B build/tidy -DWCCP_PRECOMPILE=OFF >build/tidy.log 2>&1 || { tail -n 20 build/tidy.log; return 1; }
+    cmake --preset asan -B build/tidy -DWCCP_PRECOMPILE=OFF -DWCCP_UNITY=OFF >build/tidy.log 2>&1 || { tail -n 20 build/tidy.log; return 1; }
     xargs -r -P "$jobs" -n 1 clang-tidy-14 --quiet -p build/tidy
 }
 run_package() {

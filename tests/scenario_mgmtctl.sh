@@ -154,7 +154,7 @@ ctl bypass add 10.0.0.0/8 >/dev/null && ctl intercept add 51 all to 3128 >/dev/n
 [ "$(completed bypass delete 10.0.0.0/)" = 10.0.0.0/8 ] && [ "$(completed intercept set '')" = 51 ] &&
     [ "$(completed intercept set 51 ch)" = check ] && [ "$(completed intercept set 51 rest d)" = drop ] ||
     fail "completion of bypass and intercept"
-expect 0 'jq:.intercepts[0] | .group == 51 and .active == false' --json intercept show 051 # no router has assigned yet
+expect 0 'jq:.intercepts[0] | .group == 51 and .to == 3128' --json intercept show 051
 ctl bypass delete 10.0.0.0/8 >/dev/null; ctl intercept delete 51 >/dev/null
 if lab_in a1 setpriv --reuid 65534 --clear-groups true 2>/dev/null; then
     as=(setpriv --reuid 65534 --regid 65534 --clear-groups)
@@ -235,6 +235,8 @@ explains() { # GROUP CODE WORDS : within some seconds the first reason of the gr
     lab_wait 20 "[.reasons[] | select(.group == $1 and .attention)][0] | .reason == \"$2\" and .first_ms != null and
         .next != \"\" and (.cause | contains(\"$3\"))" print_explanation "$1" || fail "explain $1 does not report $2: $3"
 }
+lab_wait_role 60 a1 51 ACTIVE || fail "the group did not become active again"
+lab_wait 20 '.attention == false' print_explanation 51 || fail "a reason is left of the time without a router"
 expect 0 '*nothing needs attention*' explain 51
 lab_in a1 bash -c 'ip link add eth1 type veth peer name eth4; ip link add eth2 type veth peer name eth3
     ip address add 10.9.1.1/24 dev eth1; ip address add 10.9.3.1/24 dev eth3; ip link set eth2 up; ip link set eth3 up

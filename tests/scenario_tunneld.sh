@@ -102,6 +102,7 @@ groups_of_eight() { # FIRST LAST
     done
 }
 case_hung_at_delete() {
+    LAB_SPEED=2 # two waits for tunneld, in real seconds, must not outlast the routers' patience
     lab_router r1 10.0.0.{1..32} -- --forward gre --return gre
     start_appliance a1 10.0.0.101 "$(groups_of_eight 51 54)"
     local i

@@ -12,6 +12,8 @@
 #include "peers/mgmtctl/link.h"
 #include "peers/mgmtctl/reasons.h"
 
+constexpr unsigned WCCP_UDP_PORT = 2048;
+
 struct check_group {
     int id = 0;
     std::string interface; // empty: none is set

@@ -27,8 +27,6 @@
 #include "runtime/cmem.h"
 
 namespace {
-constexpr unsigned WCCP_UDP_PORT = 2048;
-
 std::optional<std::string> first_line(const std::string &path) {
     std::ifstream in(path);
     std::string line;

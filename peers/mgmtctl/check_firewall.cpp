@@ -6,10 +6,12 @@
 
 #include <nlohmann/json.hpp>
 
+#include "peers/mgmtctl/check.h"
+
 namespace {
 using json = nlohmann::json;
 
-constexpr int WCCP_UDP_PORT = 2048, UDP_NUMBER = 17, GRE_NUMBER = 47;
+constexpr int UDP_NUMBER = 17, GRE_NUMBER = 47;
 constexpr int DEPTH_MAX = 16; // of jumps, as in the kernel
 constexpr const char *OWN_TABLE = "tunneld";
 

@@ -8,7 +8,7 @@
 
 namespace {
 
-constexpr size_t STATE_MAX = 15, NAME_MAX_BYTES = 160, SUBJECTS_MAX = 8192;
+constexpr size_t NAME_MAX_BYTES = 160, SUBJECTS_MAX = 8192;
 
 constexpr struct kind_row {
     notify_kind kind;

@@ -32,6 +32,8 @@ struct notify_change {
 // Length of the queue, which has one change for each subject. Further changes are dropped, and found again by
 // the next comparison.
 constexpr size_t NOTIFY_WAITING_MAX = 256;
+// Length of a state, in characters.
+constexpr size_t STATE_MAX = 15;
 
 struct notify_book {
     std::map<notify_subject, std::string> reported; // except subjects in their first state

@@ -9,7 +9,7 @@
 
 namespace {
 
-constexpr size_t VALUE_MAX = 255, STATE_MAX = 15, SOURCE_MAX = 127;
+constexpr size_t VALUE_MAX = 255, SOURCE_MAX = 127;
 
 using notify_states = std::map<std::string, notify_state>;
 
