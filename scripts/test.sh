@@ -16,6 +16,7 @@ cd "$(dirname "$0")/.." || exit 1
 scripts/install-deps.sh build lab test || exit 1
 scripts/install-deps.sh metrics || echo 'skipped: prometheus cannot be downloaded here, and its checks are left out'
 jobs=$(nproc)
+export LAB_PATIENCE=${LAB_PATIENCE:-3} # the machine may be slow, and the tests share it
 steps=("$@"); [ $# -gt 0 ] || steps=(form release asan tsan tidy fuzz package vm)
 passed=0 failed=0
 declare -a failures=() passed_at_second_run=()
