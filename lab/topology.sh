@@ -108,7 +108,7 @@ lab_enter() { # SCRIPT ARGUMENTS...
 lab_set_up() {
     # If the holder was killed right after its fork, this shell was not yet set up to die with it. /proc still shows the
     # processes outside.
-    grep -qs '^State:[[:space:]]*[^ZX]' "/proc/$LAB_HOLDER/status" || exit 1
+    grep -qs '^State:[[:space:]]*[^ZX[:space:]]' "/proc/$LAB_HOLDER/status" || exit 1
     mount -t proc proc /proc || lab_die "cannot mount /proc"
     local aside
     for aside in /media /srv /mnt /opt; do
@@ -359,7 +359,7 @@ lab_stop() { # NODE NAME [SIGNAL]
 # The wait is needed because a SIGCONT that arrives when the program exits would undo the leak checker's SIGSTOP.
 lab_continue() { # NODE NAME
     kill -s CONT "${LAB_PID[$1/$2]}"
-    lab_wait_line 5 '^State:[[:space:]]*[^T]' "/proc/$(lab_pid "$1" "$2")/status"
+    lab_wait_line 5 '^State:[[:space:]]*[^T[:space:]]' "/proc/$(lab_pid "$1" "$2")/status"
 }
 lab_expect_sockets() { # NODE NAME PID
     local own
