@@ -201,7 +201,7 @@ TEST(Intercepts, ClausesInAnyOrderAreOneCommit) {
     // What is of no use is done, with a note.
     mgmtd.nodes[ROOT + "/protocol"] = "17";
     EXPECT_EQ(intercept_command(mgmtd.link(), {"set", "51", "to", "1"}).note,
-              "group 51 redirects 17, and an intercept of tcp gets none of that");
+              "group 51 redirects udp, and an intercept of tcp gets none of that");
     EXPECT_EQ(intercept_command(mgmtd.link(), {"set", "51", "protocol", "udp"}).note, "");
     EXPECT_EQ(intercept_command(mgmtd.link(), {"add", "052", "all", "to", "1"}).note,
               "there is no group 52; it takes no part until there is");

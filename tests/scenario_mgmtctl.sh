@@ -76,7 +76,7 @@ complains '*there is nothing below*'
 # --- The whole monitoring tree: names, types, and values as far as they are known
 
 expect 0 'jq:
-    def dotted: test("^[0-9]+[.][0-9]+[.][0-9]+[.][0-9]+$");
+    def is_address: test("^[0-9]+[.][0-9]+[.][0-9]+[.][0-9]+$");
     (map({key: .name, value: .}) | from_entries) as $n | (map(select(.name | test("/(counter|reason)/") | not) | [.name, .type]) | sort) == ([
         ["", "string"], ["/oper", "string"], ["/uptime", "duration_ms"], ["/app_id", "string"],
         ["/num_routers", "uint32"], ["/num_appliances", "uint32"], ["/debug", "string"], ["/assignment", "string"],
@@ -94,7 +94,7 @@ expect 0 'jq:
     and all($n["'$S'/router/1/fwd_method", "'$S'/router/1/ret_method"].value; . == "GRE" or . == "L2")
     and $n["'$S'/counter/tx_here_i_am"].value > 0 and $n["'$S'/counter/rx_icu_failures"].value == 0
     and ($n["'$S'/router/1/assign_method"].value | . == "HASH" or . == "MASK")
-    and ($n["'$S'/router/1/id"].value | dotted)
+    and ($n["'$S'/router/1/id"].value | is_address)
     and all($n["'$S'/uptime", "'$S'/router/1/conn_time"].value; type == "number" and . > 0 and . % 1000 == 0)
     and all($n["'$S'/debug", "'$S'/assignment"].value; contains("\n")) and (tostring | contains("geheim") | not)' --json walk $S
 expect 0 '*WCCP password * : geheim *' get --secrets $S/debug
@@ -218,10 +218,10 @@ complains 'mgmtctl: mgmtd gave no answer in 0.500 s'
 [ "$(completed get "${G%1}")" = '' ] || fail "completion prints something"
 took_ms=$(((${EPOCHREALTIME/./} - ${began/./}) / 1000))
 [ $took_ms -lt 6000 ] || fail "with mgmtd stopped, get and completion took $took_ms ms"
-lab_start a1 asking mgmtctl get $G/weight
-until [ -n "$(lab_pid a1 asking)" ]; do sleep 0.1; done
+lab_start a1 asker mgmtctl get $G/weight
+until [ -n "$(lab_pid a1 asker)" ]; do sleep 0.1; done
 sleep 0.3
-lab_stop a1 asking 2>/dev/null; [ $? = 143 ] || fail "mgmtctl did not end by the signal"
+lab_stop a1 asker 2>/dev/null; [ $? = 143 ] || fail "mgmtctl did not end by the signal"
 kill -CONT "$mgmtd" "${LAB_PID[a1/mgmtd]}"
 expect 0 100 get $G/weight
 

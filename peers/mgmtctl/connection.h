@@ -28,7 +28,7 @@ struct connection {
     bool ask(ctl_walk walk, const std::string &name, ctl_reply *out) {
         return ctl_query(session.get(), walk, name, out, &reason);
     }
-    ctl_ask asking() {
+    ctl_ask asker() {
         return
             [this](ctl_walk walk, const std::string &name, ctl_reply *out) { return ask(walk, name, out); };
     }

@@ -28,7 +28,7 @@ std::vector<const snapshot_group *> groups_in_need(const html_view &view, bool w
     return out;
 }
 
-headline headline_of(const html_view &view) {
+headline choose_headline(const html_view &view) {
     const snapshot &shown = view.shown;
     if (!shown.unreachable.empty())
         return {style::bad, "mgmtd does not answer",
@@ -226,7 +226,7 @@ void add_legend(std::string *out) {
 std::string draw_page(const snapshot &shown, const page_origin &origin) {
     const std::vector<reason> reasons = reasons_of(shown);
     const html_view view = {shown, reasons, origin, shown.groups.size() <= EACH_BUCKET_GROUPS};
-    const headline head = headline_of(view);
+    const headline head = choose_headline(view);
     std::string out;
     // The policy forbids whatever is not in the file, should an escape ever be missing.
     add_html(

@@ -35,7 +35,7 @@ struct tone {
     const char *symbol;
 };
 
-const tone &tone_of(style how) {
+const tone &find_tone(style how) {
     static const tone tones[] = {{"plain", "\u2022"}, {"plain", "\u2022"}, {"dim", "\u2013"},
                                  {"good", "\u2713"},  {"warn", "\u25b2"},  {"bad", "\u2715"}};
     return tones[static_cast<size_t>(how)];
@@ -44,12 +44,12 @@ const tone &tone_of(style how) {
 } // namespace
 
 html_markup symbol_of(style how) {
-    const tone &one = tone_of(how);
+    const tone &one = find_tone(how);
     return html_of("<span class=\"sym ", one.name, "\">", one.symbol, "</span>");
 }
 
 html_markup make_badge(style how, const std::string &words) {
-    const tone &one = tone_of(how);
+    const tone &one = find_tone(how);
     return html_of("<span class=\"badge ", one.name, "\"><span>", one.symbol, "</span> ", words, "</span>");
 }
 

@@ -124,6 +124,14 @@ int protocol_number(const std::string &text) {
     return digits ? std::stoi(text) : ip_protocol_by_name(text.c_str());
 }
 
+// A group may have its protocol as a number; people know it by name.
+std::string protocol_word(const std::string &text) {
+    for (const char *word : {"tcp", "udp"})
+        if (protocol_number(text) == ip_protocol_by_name(word))
+            return word;
+    return "protocol " + text;
+}
+
 // mgmtd accepts an intercept without a matching group, but it gets no packets.
 std::string misfit_note(const ctl_link &link, const std::string &number, const std::string &protocol) {
     traffic_result unused;
@@ -135,8 +143,8 @@ std::string misfit_note(const ctl_link &link, const std::string &number, const s
     const std::string redirected = group.contains("protocol") ? group["protocol"] : "tcp";
     if (protocol_number(redirected) == protocol_number(protocol))
         return "";
-    return "group " + number + " redirects " + redirected + ", and an intercept of " + protocol +
-           " gets none of that";
+    return "group " + number + " redirects " + protocol_word(redirected) + ", and an intercept of " +
+           protocol + " gets none of that";
 }
 } // namespace
 

@@ -18,7 +18,7 @@ ctl_failure describe_missing(connection *mgmtd, const std::string &text) {
     node_name name;
     const schema_row *row = parse_node_name(text, &name) ? find_schema_row(name) : nullptr;
     return {CTL_NOT_FOUND, text, row && !row->instance ? "is not set" : "there is no such node",
-            hint_for_missing(mgmtd->asking(), text), LC_NOT_FOUND};
+            hint_for_missing(mgmtd->asker(), text), LC_NOT_FOUND};
 }
 } // namespace
 
@@ -63,12 +63,12 @@ int ctl_walk_nodes(const ctl_options &options, const std::string &name, ctl_walk
          name == "/" ? std::vector<std::string>{"/logging", "/qv"} : std::vector<std::string>{name}) {
         ctl_reply reply;
         node_name parsed;
-        if (parse_node_name(root, &parsed) ? !query_walk(mgmtd.asking(), how, parsed, &reply)
+        if (parse_node_name(root, &parsed) ? !query_walk(mgmtd.asker(), how, parsed, &reply)
                                            : !mgmtd.ask(how, root, &reply))
             return mgmtd.lost();
         if (reply.code != 0)
             return tell_failure(options, {exit_of(reply.code), root, reply.message, "", reply.code});
-        if (how != ctl_walk::children && !add_appliances(mgmtd.asking(), root, &reply.bindings))
+        if (how != ctl_walk::children && !add_appliances(mgmtd.asker(), root, &reply.bindings))
             return mgmtd.lost();
         found.insert(found.end(), reply.bindings.begin(), reply.bindings.end());
     }
@@ -76,7 +76,7 @@ int ctl_walk_nodes(const ctl_options &options, const std::string &name, ctl_walk
         return tell_failure(
             options, {CTL_NOT_FOUND, name,
                       how == ctl_walk::children ? "no node is directly below" : "there is nothing below",
-                      hint_for_missing(mgmtd.asking(), name), LC_NOT_FOUND});
+                      hint_for_missing(mgmtd.asker(), name), LC_NOT_FOUND});
     ctl_json nodes = ctl_json::array();
     for (const ctl_binding &binding : found) {
         if (options.json)
@@ -102,7 +102,7 @@ int refused_change(const ctl_options &options, connection *mgmtd, const ctl_repl
     if (!failure.node.empty())
         failure.error.erase(0, failure.node.size() + 2);
     if (reply.code == LC_NOT_FOUND || reply.code == LC_BAD_PATH)
-        failure.hint = hint_for_unchangeable(mgmtd->asking(), failure.node);
+        failure.hint = hint_for_unchangeable(mgmtd->asker(), failure.node);
     return tell_failure(options, failure);
 }
 
@@ -113,7 +113,7 @@ int commit_change(const ctl_options &options, const std::vector<ctl_change_item>
         return mgmtd.code;
     groups_before before;
     ctl_reply reply;
-    if (!look_before(mgmtd.asking(), items, &before) ||
+    if (!look_before(mgmtd.asker(), items, &before) ||
         !ctl_set(mgmtd.session.get(), items, {options.cause}, &reply, &mgmtd.reason))
         return mgmtd.lost();
     if (reply.code != 0)

@@ -16,21 +16,21 @@ const std::vector<reason_text> &reason_texts() {
         // The programs.
         {"mgmtd-unreachable", true, "mgmtd does not answer: {offered}", "start mgmtd, or look at its log"},
         {"wccpd-absent", true, "wccpd is not running: the appliance is in no group",
-         "start wccpd; its log says why it ended"},
+         "start wccpd; its log has the reason why it ended"},
         {"wccpd-silent", true, "wccpd does not answer: the state of the groups is unknown",
          "look at its log; if this lasts, restart it"},
         {"tunneld-absent", true, "tunneld has no session with mgmtd: no tunnels, no traffic",
-         "start tunneld; its log says why it ended"},
+         "start tunneld; its log has the reason why it ended"},
         {"tunneld-silent", true, "tunneld does not answer", "look at its log; if this lasts, restart it"},
         {"restart-loop", true, "{who} ends again and again: {offered}",
-         "its log says why it ends (journalctl -u {who}); the alarm is cleared once it has run for 5 "
+         "its log has the reason (journalctl -u {who}); the alarm is cleared once it has run for 5 "
          "minutes"},
         // A group that cannot begin.
         {"disabled", false, "the group is disabled", "mgmtctl group set {group} admin up"},
         {"no-interface", true, "the group has no interface", "mgmtctl group set {group} interface NAME"},
         {"no-router", true, "the group has no router", "mgmtctl group set {group} router ADDRESS"},
         {"not-taken", true, "wccpd does not have the group",
-         "its log says why; then mgmtctl group "
+         "its log has the reason; then mgmtctl group "
          "restart {group}"},
         {"not-configured", true, "wccpd runs the group although it is not configured",
          "restart wccpd; if the group comes back, report it"},
@@ -96,7 +96,7 @@ const std::vector<reason_text> &reason_texts() {
         {"tunnel-timeout", true, "tunneld did not answer in 2 s: {who} gets no tunnel",
          "look at tunneld's log; wccpd tries again with each message"},
         {"tunnel-refused", true, "tunneld refuses the tunnel to {who} ({offered} {wanted})",
-         "its log says why; mgmtctl tunnel show"},
+         "its log has the reason; mgmtctl tunnel show"},
         {"tunnel-ids-exhausted", true, "all tunnel ids ({wanted}) are in use: {who} gets no tunnel",
          "let fewer routers forward or return by GRE"},
         // Routers and appliances that do not see each other.

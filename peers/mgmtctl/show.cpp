@@ -114,7 +114,7 @@ std::string clock_text() {
 }
 
 // Identifies a line that can disappear, whatever its text: a group or its proxy, an alarm or a note.
-std::string key_of(const std::string &line) {
+std::string line_key(const std::string &line) {
     for (const char *kind : {"group ", "proxy of "})
         if (line.starts_with(kind))
             return line.substr(0, line.find("  "));
@@ -128,11 +128,11 @@ void print_changes(viewer *self, const snapshot &shown) {
     };
     std::vector<std::string> keys = {""};
     for (const std::string &line : now)
-        keys.push_back(key_of(line));
+        keys.push_back(line_key(line));
     std::string text;
     for (const std::string &line : self->before)
-        if (shown.unreachable.empty() && missing(keys, key_of(line)))
-            text += clock_text() + "  gone: " + key_of(line) + "\n";
+        if (shown.unreachable.empty() && missing(keys, line_key(line)))
+            text += clock_text() + "  gone: " + line_key(line) + "\n";
     for (const std::string &line : now)
         if (missing(self->before, line))
             text += clock_text() + "  " + line + "\n";

@@ -60,7 +60,7 @@ int tell_result(const ctl_options &options, const traffic_result &result) {
 using instance_list = std::vector<std::pair<std::string, std::map<std::string, std::string>>>;
 
 // The queries of one command, which ends with the first failure.
-struct asking {
+struct traffic_queries {
     ctl_link link;
     ctl_failure failure = {CTL_OK, "", "", "", 0};
 
@@ -132,7 +132,7 @@ ctl_json intercept_json(const std::string &number, const std::map<std::string, s
 } // namespace
 
 int tell_intercepts(const ctl_options &options, const ctl_link &link, const std::string &only) {
-    asking mgmtd = {link};
+    traffic_queries mgmtd = {link};
     instance_list intercepts;
     traffic_state traffic;
     if (!mgmtd.ask_configuration(NODE_INTERCEPT_CONFIG, &intercepts) || !mgmtd.ask_traffic(&traffic))
@@ -196,7 +196,7 @@ int ctl_intercept(const ctl_options &options, const std::vector<std::string> &wo
 // --- Bypasses
 
 int tell_bypasses(const ctl_options &options, const ctl_link &link) {
-    asking mgmtd = {link};
+    traffic_queries mgmtd = {link};
     instance_list bypasses;
     traffic_state traffic;
     if (!mgmtd.ask_configuration(NODE_BYPASS_CONFIG, &bypasses) || !mgmtd.ask_traffic(&traffic))
@@ -274,7 +274,7 @@ void put_tunnels(const traffic_state &traffic) {
 } // namespace
 
 int tell_tunnels(const ctl_options &options, const ctl_link &link) {
-    asking mgmtd = {link};
+    traffic_queries mgmtd = {link};
     traffic_state traffic;
     if (!mgmtd.ask_traffic(&traffic))
         return tell_failure(options, mgmtd.failure);
@@ -308,7 +308,7 @@ int ctl_tunnel(const ctl_options &options, const std::vector<std::string> &words
 
 namespace {
 int tell_protection(const ctl_options &options, const ctl_link &link) {
-    asking mgmtd = {link};
+    traffic_queries mgmtd = {link};
     traffic_state traffic;
     if (!mgmtd.ask_traffic(&traffic))
         return tell_failure(options, mgmtd.failure);

@@ -126,7 +126,7 @@ void server_take_event(server *self, uint32_t peer_id, const std::string &event,
                 server_send_event(self, event, fields);
             return;
         }
-    self->say("event of " + self->peers[peer_id].name + " passed over: " + event);
+    self->say("event of " + self->peers[peer_id].name + " ignored: " + event);
 }
 
 void server_raise_own_alarm(server *self, const std::vector<event_field> &fields, bool is_news) {

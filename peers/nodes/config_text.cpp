@@ -55,7 +55,7 @@ struct parser {
     config_text *text;
     int line = 0;
     std::string section = {}; // "" or an absolute name
-    bool skipping = false;    // the section was refused; its lines are passed over
+    bool skipping = false;    // the section was refused; its lines are skipped
     std::string pending = {}; // comment lines of the next node or section
     std::string heading = {}; // comment lines of the current section, which has had no node yet
 };
