@@ -259,6 +259,7 @@ part_orders() {
     for i in $(seq 50); do # side by side, each in an appliance of its own, at moments of its own
         lab_alone "$WCCP_BIN/tunneld_timed" orders "$WCCP_BIN/tunneld" 1 "$((TRAFFIC_QUIET + i / 5)).$((RANDOM % 900 + 100))" \
             >>"$times" & waiting+=($!)
+        sleep 0.2 # not all start at once
     done
     wait "${waiting[@]}"
     [ "$(wc -l <"$times")" = 50 ] || die 'orders after quiet failed'
