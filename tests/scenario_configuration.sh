@@ -103,8 +103,8 @@ case_many() {
     for id in $(seq 10 49); do text+="$(lab_group "$id" 10.0.0.1 weight=$id)"$'\n'; done
     start_appliance a1 10.0.0.101
     configure a1 "$text"
-    lab_wait 40 '[.groups[].assignment.kind] | length == 40 and all(. == "mask")' lab_ctl r1 show || die "not all groups have tables"
-    lab_wait 40 '[.[].oper] | length == 40 and all(. == "ACTIVE, DESIGNATED")' lab_state a1 || die "not all groups are active"
+    lab_wait 15 '[.groups[].assignment.kind] | length == 40 and all(. == "mask")' lab_ctl r1 show || die "not all groups have tables"
+    lab_wait 15 '[.[].oper] | length == 40 and all(. == "ACTIVE, DESIGNATED")' lab_state a1 || die "not all groups are active"
     configure a1
     lab_wait 10 '[.groups[].appliances[]] == []' lab_ctl r1 show || die "not all groups have left"
     lab_wait 5 '. == {}' lab_state a1 || die "groups are left"
