@@ -249,8 +249,14 @@ const snapshot_reason *last_reason(const std::vector<snapshot_reason> &reasons,
 
 const snapshot_reason *router_reason(const snapshot &shown, const snapshot_group &group,
                                      const snapshot_router &router) {
-    const snapshot_reason *of_group =
-        last_reason(group.reasons, [&](const snapshot_reason &each) { return is_about(each, router); });
+    // One that needs attention, rather than a later one that does not.
+    const snapshot_reason *of_group = last_reason(group.reasons, [&](const snapshot_reason &each) {
+        const reason_text *text = find_reason_text(each.code);
+        return is_about(each, router) && (!text || text->attention);
+    });
+    if (!of_group)
+        of_group =
+            last_reason(group.reasons, [&](const snapshot_reason &each) { return is_about(each, router); });
     // A packet that is refused before its group is known may have been for any group of its sender. One for a
     // group that is not configured may have been meant for a group that hears nothing.
     const snapshot_reason *of_none = last_reason(shown.reasons, [&](const snapshot_reason &each) {
