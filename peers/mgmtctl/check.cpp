@@ -348,10 +348,12 @@ int tell_checks(const ctl_options &options, const check_result &result) {
         put(each.code + (each.group < 0 ? "" : " (group " + std::to_string(each.group) + ")") + ": " +
             each.cause + "\n    " + (each.attention ? "fix: " : "no fault: ") + each.next + "\n");
     std::map<std::string, std::string> unchecked; // the names of the checks, by the reason
-    for (const auto &each : result.unchecked)
-        unchecked[each.why] += (unchecked[each.why].empty() ? "" : ", ") + each.check;
+    for (const auto &each : result.unchecked) {
+        std::string &names = unchecked[each.why];
+        names.append(names.empty() ? "" : ", ").append(each.check);
+    }
     for (const auto &[why, names] : unchecked)
-        put("not checked: " + names + ": " + why + "\n");
+        put(std::string("not checked: ").append(names).append(": ").append(why).append("\n"));
     std::string fine;
     for (const std::string &each : result.fine)
         fine += (fine.empty() ? "fine: " : ", ") + each;

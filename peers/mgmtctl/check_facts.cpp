@@ -155,8 +155,9 @@ void gather_sockets(check_facts *out) {
     read_sockets("/proc/net/udp6", &sockets);
     if (!sockets.empty())
         for_processes([&](int id, const std::string &directory) {
-            for (const std::string &name : names_in(directory + "/fd")) {
-                const auto found = sockets.find(link_text(directory + "/fd/" + name));
+            const std::string descriptors = directory + "/fd/";
+            for (const std::string &name : names_in(descriptors)) {
+                const auto found = sockets.find(link_text(descriptors + name));
                 if (found == sockets.end())
                     continue;
                 found->second.program = first_line(directory + "/comm").value_or("");

@@ -33,8 +33,8 @@ std::string text_at(const json &object, const char *key) {
     return found != object.end() && found->is_string() ? found->get<std::string>() : std::string();
 }
 
-struct rules_of_chain {
-    json head; // of the chain
+struct rules_of_chain { // NOLINT(bugprone-exception-escape): moving JSON does not throw
+    json head;          // of the chain
     std::vector<json> rules;
 };
 

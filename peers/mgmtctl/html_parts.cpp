@@ -248,8 +248,14 @@ std::string html_style() {
     std::string out = STYLE;
     for (size_t i = 0; i < std::size(PALETTE); i++) {
         const std::string name = "o" + std::to_string(i);
-        out += "." + name + ">i{background:" + PALETTE[i][0] + ";color:" + PALETTE[i][1] + "}.bar." + name +
-               "{--colour:" + PALETTE[i][0] + "}\n";
+        const auto &[background, text] = PALETTE[i];
+        out.append(".")
+            .append(name)
+            .append(">i{background:")
+            .append(background)
+            .append(";color:")
+            .append(text);
+        out.append("}.bar.").append(name).append("{--colour:").append(background).append("}\n");
     }
     out += "@media screen and (max-width:46rem){";
     for (const table_kind &kind : table_kinds())
