@@ -162,8 +162,8 @@ lab_plug() { # NODE PID ADDRESS...
         echo 'link set lo up'
         for address; do echo "address add $address/24 dev eth0"; done
         echo 'link set eth0 up'
-        echo 'route add default via 10.0.0.254'
-    } | nsenter -t "$pid" --net ip -force -batch - 2>/dev/null
+    } | nsenter -t "$pid" --net ip -batch - || lab_die "cannot set up eth0 of $node"
+    nsenter -t "$pid" --net ip route add default via 10.0.0.254 2>/dev/null # not from every network
     return 0
 }
 
@@ -423,7 +423,7 @@ lab_wait_until() { # SECONDS COMMAND...
 }
 # Waits for a line in a file.
 lab_wait_line() { # SECONDS EXPRESSION FILE
-    lab_wait_until "$1" grep -Eqs -- "$2" "$3" || { echo "lab: after $1 s no line in $3: $2" >&2; return 1; }
+    lab_wait_until "$1" grep -Eqs -- "$2" "$3" || { echo "lab: after $(($1 * LAB_PATIENCE)) s no line in $3: $2" >&2; return 1; }
 }
 
 # --- The programs of an appliance
@@ -545,7 +545,7 @@ lab_has_role() { # NODE GROUP ROLE
 }
 lab_wait_role() { # SECONDS NODE GROUP ROLE
     lab_wait_until "$1" lab_has_role "${@:2}" ||
-        { echo "lab: after $1 s the role of group $3 in $2 is '$LAB_ROLE', not $4" >&2; return 1; }
+        { echo "lab: after $(($1 * LAB_PATIENCE)) s the role of group $3 in $2 is '$LAB_ROLE', not $4" >&2; return 1; }
 }
 lab_wait_event() { # SECONDS NODE EXPRESSION
     lab_wait_line "$1" "$3" "$LAB/$2-mgmtd.out"
@@ -561,7 +561,7 @@ lab_logged() { # NODE EXPRESSION
     grep -Eq -- "$2" < <(lab_log "$1")
 }
 lab_wait_log() { # SECONDS NODE EXPRESSION
-    lab_wait_until "$1" lab_logged "${@:2}" || { echo "lab: after $1 s no line in the log of $2: $3" >&2; return 1; }
+    lab_wait_until "$1" lab_logged "${@:2}" || { echo "lab: after $(($1 * LAB_PATIENCE)) s no line in the log of $2: $3" >&2; return 1; }
 }
 
 lab_manage() { # NODE WORDS...
