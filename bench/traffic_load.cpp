@@ -2,8 +2,8 @@
 //
 // traffic_load router LOCAL REMOTE INTERFACE
 //     provides the router's end of a GRE tunnel, as an interface, until SIGTERM
-// traffic_load packets DEVICE MAC plain|gre FLOWS RATE SECONDS
-//     sends small UDP packets, RATE a second (0: without a limit)
+// traffic_load packets DEVICE MAC ADDRESS FLOWS RATE SECONDS
+//     sends small UDP packets to ADDRESS, RATE a second (0: without a limit), in frames to MAC
 // traffic_load sink PORT
 //     accepts TCP connections, reads them to their end, and sends back the number of bytes
 // traffic_load source ADDRESS PORT SECONDS BYTES
@@ -11,7 +11,7 @@
 // traffic_load split DEVICE
 //     turns segmentation offload off: the device gets only packets of its MTU
 //
-// Results are printed as one JSON object. The addresses are those of the script.
+// Results are printed as one JSON object. The address of the clients is in the network of the script.
 //
 // The router is the appliance's own user-space plane with its two ends exchanged: it splits the client's
 // large segments into packets, completes their checksums, and leaves the fragmentation of large GRE packets
@@ -50,10 +50,8 @@
 namespace {
 
 constexpr size_t CHUNK = 256 * 1024;
-constexpr uint32_t APPLIANCE = 0x0a000065, ROUTER = 0x0a000001; // 10.0.0.101, 10.0.0.1
-constexpr uint32_t CLIENT = 0x0a010080, SERVER = 0x0a020002;    // 10.1.0.128, 10.2.0.2
-constexpr uint8_t GROUP = 51, DYNAMIC_GROUP = 0x80;
-constexpr size_t SMALL_PACKET = 46; // an Ethernet frame of 64 bytes, with its checksum
+constexpr uint32_t CLIENT = 0x0a010080; // 10.1.0.128, the first of 64
+constexpr size_t SMALL_PACKET = 46;     // an Ethernet frame of 64 bytes, with its checksum
 constexpr uint16_t DISCARD_PORT = 9;
 
 [[noreturn]] void die(const std::string &what) {
@@ -113,20 +111,22 @@ void append(std::vector<uint8_t> *to, const void *bytes, size_t length) {
     const auto *first = static_cast<const uint8_t *>(bytes);
     to->insert(to->end(), first, first + length);
 }
-ip4_wire_header ip_header(uint32_t source, uint32_t destination, uint8_t protocol, size_t payload) {
+ip4_wire_header udp_ip_header(uint32_t source, uint32_t destination, size_t payload) {
     ip4_wire_header ip = {};
     ip.version_ihl = 0x45;
     ip.total_length = to_be16(static_cast<uint16_t>(sizeof ip + payload));
+    ip.fragment = to_be16(IP4_DONT_FRAGMENT); // as sockets send it unless asked otherwise
     ip.ttl = 64;
-    ip.protocol = protocol;
+    ip.protocol = PROTOCOL_UDP;
     ip.source = to_be32(source);
     ip.destination = to_be32(destination);
     ip.checksum = checksum_finish(checksum_add(0, &ip, sizeof ip));
     return ip;
 }
-std::vector<uint8_t> small_packet(uint32_t flow) {
+// An Ethernet frame of 64 bytes, counting its checksum.
+std::vector<uint8_t> small_frame(uint32_t flow, const uint8_t *mac, uint32_t destination) {
     constexpr size_t length = SMALL_PACKET - sizeof(ip4_wire_header);
-    const ip4_wire_header ip = ip_header(CLIENT + flow % 64, SERVER, PROTOCOL_UDP, length);
+    const ip4_wire_header ip = udp_ip_header(CLIENT + flow % 64, destination, length);
     std::array<uint8_t, length> rest = {};
     udp_wire_header udp = {};
     udp.source_port = to_be16(static_cast<uint16_t>(1024 + flow));
@@ -135,25 +135,12 @@ std::vector<uint8_t> small_packet(uint32_t flow) {
     memcpy(rest.data(), &udp, sizeof udp);
     udp.checksum = checksum_finish(checksum_add(checksum_pseudo(ip, length), rest.data(), length));
     memcpy(rest.data(), &udp, sizeof udp);
-    std::vector<uint8_t> packet;
-    append(&packet, &ip, sizeof ip);
-    append(&packet, rest.data(), length);
-    return packet;
-}
-std::vector<uint8_t> frame_of(uint32_t flow, const uint8_t *mac, bool gre) {
-    std::vector<uint8_t> inner = small_packet(flow), frame;
+    const uint8_t source_and_type[] = {2, 0, 0, 0, 0, 1, ETH_P_IP >> 8, ETH_P_IP & 255};
+    std::vector<uint8_t> frame;
     append(&frame, mac, ETH_ALEN);
-    const uint8_t from[] = {2, 0, 0, 0, 0, 1, ETH_P_IP >> 8, ETH_P_IP & 255};
-    append(&frame, from, sizeof from);
-    if (gre) {
-        uint8_t header[GRE_MAX_WRITTEN];
-        const gre_wire_redirect redirect = {DYNAMIC_GROUP, GROUP, 0, static_cast<uint8_t>(flow)};
-        const size_t length = write_gre_header(header, &redirect);
-        const ip4_wire_header outer = ip_header(ROUTER, APPLIANCE, PROTOCOL_GRE, length + inner.size());
-        append(&frame, &outer, sizeof outer);
-        append(&frame, header, length);
-    }
-    append(&frame, inner.data(), inner.size());
+    append(&frame, source_and_type, sizeof source_and_type);
+    append(&frame, &ip, sizeof ip);
+    append(&frame, rest.data(), length);
     return frame;
 }
 int open_device(const char *device) {
@@ -174,7 +161,7 @@ int run_packets(char **words) {
     if (sscanf(words[1], "%hhx:%hhx:%hhx:%hhx:%hhx:%hhx", &mac[0], &mac[1], &mac[2], &mac[3], &mac[4],
                &mac[5]) != ETH_ALEN)
         die(words[1]);
-    const bool gre = strcmp(words[2], "gre") == 0;
+    const uint32_t destination = address_of(words[2]);
     const auto flows = static_cast<uint32_t>(strtoul(words[3], nullptr, 10));
     const double rate = strtod(words[4], nullptr), seconds = strtod(words[5], nullptr);
     const int fd = open_device(words[0]);
@@ -185,7 +172,7 @@ int run_packets(char **words) {
     std::vector<mmsghdr> messages(frames + burst);
     for (uint32_t i = 0; i < frames + burst; i++) { // the first ones again, for a burst that wraps
         if (i < frames)
-            made[i] = frame_of(i, mac, gre);
+            made[i] = small_frame(i, mac, destination);
         parts[i] = {made[i % frames].data(), made[i % frames].size()};
         messages[i].msg_hdr.msg_iov = &parts[i];
         messages[i].msg_hdr.msg_iovlen = 1;
