@@ -7,7 +7,7 @@
 // otherwise take quadratic time.
 //
 // The index holds positions. Every operation that moves, replaces or removes elements drops it, before it
-// changes anything; appending needs not, since the index adds what it hasn't seen at the next search.
+// changes anything; appending need not, since the next search adds the new elements to the index.
 //
 // The copying operations, and those that apply a policy, are written in terms of the _takeover operations.
 #include "runtime/array.h"
@@ -250,7 +250,7 @@ lc_status array_set_takeover(array *list, uint32_t index, void **inout_element) 
     list->sorted = 0;
     void *old = list->elements[index];
     if (old == *inout_element) {
-        // The caller passes the element that is there already: freeing "the old one" would free it.
+        // The caller passes the element that is already in the slot: freeing "the old one" would free it.
         *inout_element = nullptr;
         return LC_OK;
     }

@@ -3,11 +3,11 @@
 #include <cstdlib>
 
 // Open addressing with linear probing. A slot holds a position plus 1, or 0 when it is free. There are always
-// at least twice as many slots as elements, so a probe ends. Nothing is ever removed: a change that would
-// need it drops the whole index.
+// at least twice as many slots as elements; therefore every probe ends. Nothing is ever removed: a change
+// that would need it drops the whole index.
 struct array_index {
     uint32_t slot_count; // a power of two
-    uint32_t indexed;    // so many elements from the start have been entered
+    uint32_t indexed;    // number of elements, from the start, that have been entered
     uint32_t key_changes;
     uint32_t slots[];
 };
@@ -59,7 +59,7 @@ bool make_index(const array *list) {
 }
 
 bool update_index(const array *list) {
-    // A key that has changed inside an element makes its entry wrong, and so does an array that got shorter.
+    // A key that has changed inside an element makes its entry wrong, as does an array that got shorter.
     if (list->index &&
         (list->index->key_changes != count_key_changes(list) || list->index->indexed > list->length ||
          2 * uint64_t{list->length} > list->index->slot_count))

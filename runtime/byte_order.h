@@ -1,6 +1,6 @@
 // Network byte order as a type. A be16 or be32 holds its bytes in the order in which they are sent. It can be
 // copied and compared for equality; for anything else it has to be converted with to_host(), and back with
-// to_be16() or to_be32(). The alignment is 1, and so is that of a layout made of these: it can be read at any
+// to_be16() or to_be32(). The alignment is 1, as is that of a layout made of these: it can be read at any
 // offset of a packet.
 #pragma once
 

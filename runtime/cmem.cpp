@@ -1,10 +1,10 @@
 // Named blocks of System V shared memory and their registry.
 //
-// The registry is a segment that also other programs of the platform use, so its layout is fixed: 2000 block
-// records, 400 entries of "mem.conf" and a state word. The first process changes the state from empty to
-// loading by compare-and-swap, loads the file and sets it to ready, or back to empty if the file couldn't be
-// read; other processes wait for it. A registry that can't be attached ends the process; every other failure
-// is logged and returned.
+// The registry is a segment that other programs of the platform use as well; therefore its layout is fixed:
+// 2000 block records, 400 entries of "mem.conf" and a state word. The first process changes the state from
+// empty to loading by compare-and-swap, loads the file and sets it to ready, or back to empty if the file
+// couldn't be read; other processes wait for it. A registry that can't be attached ends the process; every
+// other failure is logged and returned.
 //
 // A System V semaphore with the registry's key serialises the creation of blocks. It is 0 while it is free;
 // SEM_UNDO makes the kernel release it if its holder dies. A free record is claimed by compare-and-swap all
@@ -12,7 +12,7 @@
 //
 // A key may belong to a segment of another size that somebody else has created. Its size is therefore checked
 // before a byte of it is used. A segment that is too short for its block, or for the registry, is treated as
-// one that can't be attached, and so is a registry with an unknown state.
+// one that can't be attached, as is a registry with an unknown state.
 #include "runtime/cmem.h"
 
 #include <atomic>
@@ -147,8 +147,7 @@ uint64_t parse_hex(const char *word, uint64_t limit) {
     return errno == 0 && *end == '\0' && word[0] != '-' && number <= limit ? number : 0;
 }
 
-// False for a line that is ignored; `out_wrong` says what is wrong with it, null for a comment or an empty
-// line.
+// False for a line that is ignored; `out_wrong` is the reason, or null for a comment or an empty line.
 bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) {
     *out_wrong = nullptr;
     const char *name = next_word(&line);
@@ -169,8 +168,8 @@ bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) {
     return true;
 }
 
-// Calls take(entry) for each valid line until that returns false, and fail(what is wrong, line, line number)
-// for each invalid one. Returns 0, or the errno if the file can't be read.
+// Calls take(entry) for each valid line until that returns false, and fail(reason, line, line number) for
+// each invalid one. Returns 0, or the errno if the file can't be read.
 template <typename Take, typename Fail>
 int read_conf(const char *path, const Take &take, const Fail &fail) {
     FILE *file = fopen(path, "re");

@@ -34,7 +34,7 @@ void *cmem_create_block(uint64_t length, const char *name);
 // `out_length` may be null; it gets the usable length in bytes, which is that of the segment in whole pages.
 void *cmem_attach_block(const char *name, uint64_t *out_length = nullptr);
 // The id of the process that created the block, the most recent one if there were several; 0 if there is no
-// such block. `out_lives`: whether it is still running.
+// such block, or if this process has not attached the registry. `out_lives`: whether it is still running.
 int32_t cmem_find_creator(const char *name, bool *out_lives);
 
 // A mutex within the process, with default attributes and a name for debugging. Lock and unlock return 0, 1

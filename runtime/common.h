@@ -2,10 +2,10 @@
 //
 // Almost every operation of runtime/ and mgmt/ returns an lc_status: 0 is success, failures are 14000 to
 // 14502, and lc_status_table has their descriptions. A caller wraps each call in one of the CHECK_ macros
-// below, which return a failure to the next caller. Resources are owned by scope guards (runtime/guards.h),
-// so an early return leaks nothing. CHECK_STATUS logs a line with function, file and line number, so a
-// failure leaves one line per level of the call chain, innermost first. LC_CANCELLED is propagated without
-// logging: the operation was ended on purpose.
+// below, which return a failure to the next caller. Resources are owned by scope guards (runtime/guards.h):
+// an early return leaks nothing. CHECK_STATUS logs a line with function, file and line number: a failure
+// leaves one line per level of the call chain, innermost first. LC_CANCELLED is propagated without logging:
+// the operation was ended on purpose.
 #pragma once
 
 #include <cstdarg>
@@ -57,7 +57,7 @@ enum : lc_status {
 };
 
 // A table of values and names, ended by an entry whose name is null. It is searched from the start: the first
-// match counts, so several names may have one value.
+// match counts. Several names may have one value.
 struct lc_enum_entry {
     int32_t value;
     const char *name;

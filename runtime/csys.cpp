@@ -17,7 +17,8 @@ constexpr uint32_t OVERHEAD = sizeof(csys_display_buf) + 1; // descriptor and te
 
 namespace {
 
-// The caller's memory may end at any address, so the descriptor can be unaligned: it is copied in and out.
+// The caller's memory may end at any address. The descriptor can therefore be unaligned: it is copied in and
+// out.
 csys_display_buf load_descriptor(const csys_display_buf *buffer) {
     csys_display_buf copy;
     memcpy(&copy, static_cast<const void *>(buffer), sizeof copy);
@@ -56,7 +57,7 @@ uint32_t csys_append_to_safe_display_buf(csys_display_buf *buffer, const char *s
     memcpy(state.position, string, copied);
     state.position += copied;
     state.left -= copied;
-    // The caller's sign of a text that was cut, also in the output itself.
+    // A newline at the end shows, also in the output itself, that the text was truncated.
     if (!fits)
         state.position[-1] = '\n';
     *state.position = '\0';

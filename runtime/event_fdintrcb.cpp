@@ -160,12 +160,12 @@ lc_status remove_interest(fdic_libevent *bridge, const fdic_event *change) {
     fdic_libevent_entry *entry = find_bridge_entry(bridge, change->id);
     if (!entry)
         return LC_OK;
-    // What the handler gets is read before the entry is freed.
-    const bool told = entry->interest.has_fd && bridge->close_handler;
+    // The arguments of the handler are read before the entry is freed.
+    const bool has_handler = entry->interest.has_fd && bridge->close_handler;
     const int fd = entry->interest.fd;
     void *user_data = entry->interest.user_data;
     LOG_STATUS(ht_delete(bridge->entries, &change->id, sizeof change->id));
-    if (told)
+    if (has_handler)
         CHECK_STATUS(bridge->close_handler(fd, FDIC_FD_CLOSED, user_data, bridge->close_data));
     return LC_OK;
 }
@@ -200,7 +200,7 @@ lc_status apply_interest(fdic_libevent *bridge, const fdic_event *change) {
             CHECK_STATUS(
                 bridge->open_handler(change->fd, FDIC_FD_OPENED, change->user_data, bridge->open_data));
     }
-    // The open handler may have changed the table, so the entry is looked up again.
+    // The open handler may have changed the table; therefore the entry is looked up again.
     fdic_libevent_entry *entry = find_bridge_entry(bridge, change->id);
     if (!entry)
         return LC_OK; // the open handler has removed it

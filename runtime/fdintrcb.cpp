@@ -2,7 +2,8 @@
 //
 // A list has two arrays: the current interests, and those that the change callback has been given last. Each
 // operation changes the first one, then compares it with the second and passes the differences to the
-// callback. The callback is called last, when both arrays are consistent, so it may change the list itself.
+// callback. The callback is called last, when both arrays are consistent; it may therefore change the list
+// itself.
 //
 // A GCL instance (mgmt/gcl.h) is the user of a list, and its lock guards it.
 #include "runtime/fdintrcb.h"

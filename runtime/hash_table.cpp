@@ -228,12 +228,13 @@ lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value)
     owned<ht_entry, free_entry_record> entry(static_cast<ht_entry *>(calloc(1, sizeof(ht_entry))));
     CHECK_NULL(entry.pointer);
     *entry.pointer = {const_cast<void *>(key), length, value, nullptr};
-    // Deletes an old entry of this key. This may resize the table, so the place is looked up only afterwards.
+    // Deletes an old entry of this key. This may resize the table; therefore the place is looked up only
+    // afterwards.
     CHECK_STATUS(ht_delete(table, key, key_length));
     if (table->insert_function)
         CHECK_STATUS(table->insert_function(key, length, value, table->user_word, &entry.pointer->key,
                                             &entry.pointer->value));
-    *find_link(table, key, length) = entry.take(); // the key is not there, so this is the end of its chain
+    *find_link(table, key, length) = entry.take(); // the key is absent: this is the end of its chain
     table->entry_count++;
     adapt_bucket_count(table);
     return LC_OK;

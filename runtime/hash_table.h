@@ -61,8 +61,8 @@ lc_status ht_free(ht **inout);
 // are refused; otherwise its entry is deleted before the new one is made. If the free function fails for the
 // old entry, the result is LC_GENERIC: the old entry is gone, and the new key and value stay the caller's.
 lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value);
-// A missing key is not a failure: `out_found` is 0 and `out_key_length` -1. Outs may be null. What they give
-// stays the table's.
+// A missing key is not a failure: `out_found` is 0 and `out_key_length` -1. Outs may be null. The results
+// stay the table's.
 lc_status ht_lookup(const ht *table, const void *key, int32_t key_length, int *out_found, void **out_key,
                     int32_t *out_key_length, void **out_value);
 lc_status ht_delete(ht *table, const void *key, int32_t key_length); // 0 for a missing key

@@ -2,7 +2,7 @@
 //
 // Any thread may log. G_log_state_lock guards the state; the levels are atomic and are read without it, so
 // that a line which isn't written costs two loads. Cancellation is disabled while the lock is held. The
-// buffers are on the stack, and a line of ordinary length allocates nothing, so logging works when memory is
+// buffers are on the stack, and a line of ordinary length allocates nothing: logging works when memory is
 // exhausted. syslog_socket.cpp sends the lines and never blocks for long; lines that are lost because the
 // daemon doesn't read are counted, and the number is logged before the next line that can be sent.
 //
@@ -175,7 +175,7 @@ lc_status init_unnamed() {
         name[count] = '\0';
         fclose(file);
     }
-    // cmdline has NULs between the arguments, so this is only the first, the program's path.
+    // cmdline has NULs between the arguments: this is only the first, the program's path.
     const char *slash = strrchr(name, '/');
     char full[96];
     snprintf(full, sizeof full, "%s-UNINIT", name[0] ? (slash ? slash + 1 : name) : "UNKNOWN");
@@ -184,7 +184,7 @@ lc_status init_unnamed() {
 
 // --- Writing a line
 
-// What a line consists of, besides the caller's text.
+// The parts of a line besides the caller's text.
 struct log_line {
     lc_log_state *state;
     const char *function;
@@ -236,7 +236,7 @@ void append_text(line_format *format, const char *pattern, ...) {
 }
 
 void append_stamp(line_format *format, const log_line *line) {
-    // The finest stamp that is asked for is used, so it comes first.
+    // The finest stamp that is requested is used; therefore it is tested first.
     static const struct {
         uint32_t flag;
         long divisor;

@@ -2,7 +2,8 @@
 // lock held but the log's own and lc_env_lock. Lines go to the syslog daemon's socket and block the caller
 // for milliseconds at most (runtime/syslog_socket.cpp).
 //
-// Use the macros QV_LOG and LC_LOG at the end of this file. They leave errno alone, so "%m" can be used.
+// Use the macros QV_LOG and LC_LOG at the end of this file. They leave errno alone; therefore "%m" can be
+// used.
 #pragma once
 
 #include <atomic>

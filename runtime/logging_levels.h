@@ -45,7 +45,8 @@ struct lc_log_state {
 // No lock.
 bool log_is_managed(const char *process_name);
 
-// Sets the system level, and the mask of the socket, to what the level link says, NOTICE without one.
+// Sets the system level, and the mask of the socket, to the level in the level link, or to NOTICE without a
+// link.
 void log_take_system_level(lc_log_state *state);
 // Check the files, at most once a second, for a process that isn't managed. `now` in seconds.
 void log_poll_level_link(lc_log_state *state, time_t now);

@@ -46,8 +46,8 @@ lc_status lew_deinit(lew **inout_context);
 // Descriptor and timer events. By the owner, or by any thread after the owner's thread has ended.
 using loop_function = void (*)(int fd, short flags, void *data);
 lc_status loop_event_new(loop_context *context, loop_function function, void *data, loop_event **out);
-// Calls the event's function whenever `fd` is ready for what `flags` asks, LOOP_READ, LOOP_WRITE or both,
-// until the event is removed. An event that is active already is removed first, also by loop_event_set_timer.
+// Calls the event's function whenever `fd` is readable (LOOP_READ in `flags`) or writable (LOOP_WRITE), until
+// the event is removed. An event that is active already is removed first, also by loop_event_set_timer.
 lc_status loop_event_set_fd(loop_event *event, int fd, short flags);
 // Calls the event's function once, with LOOP_TIMEOUT, after `delay_ms` milliseconds.
 lc_status loop_event_set_timer(loop_event *event, int64_t delay_ms);
@@ -65,7 +65,7 @@ struct loop_post {
     void (*function)(loop_post *post, int carry_out);
 };
 int loop_is_own_thread(const loop_context *context); // 1 when the caller is the owner
-// Never waits for the owner, so the caller may hold locks that a callback takes.
+// Never waits for the owner; the caller may therefore hold locks that a callback takes.
 void loop_post_work(loop_context *context, loop_post *post);
 void loop_run_posted(loop_context *context); // carries out what has been posted so far
 // Withdraws all work of this poster. By the owner, or by any thread after the owner's thread has ended.

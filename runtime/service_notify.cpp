@@ -25,7 +25,7 @@ bool parse_positive(const char *text, int64_t *out) {
 
 void read_socket(const char *path) {
     const size_t length = strlen(path);
-    // A leading "@" stands for the NUL at the start of the name of an abstract socket (unix(7)).
+    // A leading "@" represents the NUL at the start of the name of an abstract socket (unix(7)).
     if ((path[0] != '/' && path[0] != '@') || length < 2 || length >= sizeof manager.sun_path)
         return;
     manager.sun_family = AF_UNIX;

@@ -10,6 +10,6 @@ void service_open();
 // Sends "READY=1", "STOPPING=1", "WATCHDOG=1" or "STATUS=...", or several separated by newlines. Never
 // blocks; a report that can't be sent is lost. Any thread; not a cancellation point.
 void service_report(const char *state);
-// The watchdog timeout: the service manager ends a program that sends no "WATCHDOG=1" for so many
+// The watchdog timeout: the service manager ends a program that sends no "WATCHDOG=1" for this many
 // milliseconds. -1 if the watchdog is not enabled.
 int64_t service_watchdog_ms();

@@ -1,11 +1,11 @@
 // Sends lines to the syslog daemon without blocking on it.
 //
 // syslog(3) blocks while the daemon doesn't read: after about a dozen lines if the socket's queue is short,
-// at the latest when the send buffer is full. The engine logs with its lock held, so a stopped syslog daemon
-// would stop the engine. Here a line is sent without blocking. If the queue is full, the line waits, but all
-// lines together only for 30 ms (the patience). A daemon that works empties its queue in that time, so a
-// burst arrives complete and in order. When the patience is used up, each line is tried once and dropped,
-// until one is sent, which restores the patience.
+// at the latest when the send buffer is full. The engine logs with its lock held; therefore a stopped syslog
+// daemon would stop the engine. Here a line is sent without blocking. If the queue is full, the line waits,
+// but all lines together only for 30 ms (the patience). A daemon that works empties its queue in that time;
+// therefore a burst arrives complete and in order. When the patience is used up, each line is tried once and
+// dropped, until one is sent, which restores the patience.
 //
 // A line waits in short steps and is tried after each, because poll() reports a socket as writable only when
 // half of its send buffer is free. A slow daemon may take long for that, although a line would fit much

@@ -50,7 +50,7 @@ uint32_t tb_avail(const tbuffer *buffer); // size minus length
 uint8_t *tb_buf(const tbuffer *buffer);
 uint8_t *tb_buf_maybe(const tbuffer *buffer);
 lc_status tb_ensure_size(tbuffer *buffer, uint32_t size);
-// LC_GENERIC for more than the size. With these two a reader has the buffer filled by read() for example.
+// LC_GENERIC for more than the size. With these two a caller can fill the buffer by read(), for example.
 lc_status tb_set_length(tbuffer *buffer, uint32_t length);
 lc_status tb_clear(tbuffer *buffer);
 // Moves up what follows. LC_NO_BUFFER_SPACE past the end.

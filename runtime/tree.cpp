@@ -1,6 +1,6 @@
 // The named tree. A node's children are an `array` that is sorted by name and owns them, so that freeing a
-// node frees everything below it, by recursion. Who builds a tree from names of a peer must limit their
-// depth.
+// node frees everything below it, by recursion. A caller that builds a tree from names of a peer must limit
+// their depth.
 #include "runtime/tree.h"
 
 #include <cstdlib>

@@ -40,7 +40,7 @@ lc_status tstr_array_new(tstr_array **out, const tstr_array_options *options) {
 namespace {
 
 // The start of the allocation of a packed array, followed by the slots, the string records and the texts. The
-// family's record comes first, so freeing it frees everything.
+// family's record comes first: freeing it frees everything.
 struct packed {
     tstr_array family;
     array list;

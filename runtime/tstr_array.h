@@ -28,6 +28,6 @@ lc_status tstr_array_insert_str(tstr_array *array, uint32_t index, const char *t
 
 // Matches the parts of a name with those of a pattern. "*" matches exactly one part of any content. "**"
 // matches one or more parts and ends the comparison: what follows it in the pattern only counts as parts that
-// the name must have at least, so "/a/**/b" matches "/a/x/y". "*" as a piece of a longer part is an ordinary
-// character.
+// the name must have at least; therefore "/a/**/b" matches "/a/x/y". "*" as a piece of a longer part is an
+// ordinary character.
 lc_status tstr_array_wildcard_match(const tstr_array *pattern, const tstr_array *parts, int *out_matched);

@@ -239,7 +239,7 @@ lc_status ts_detach(tstring **inout, char **out_text, int32_t *out_length) {
     CHECK_NULL(*inout);
     CHECK_NULL(out_text);
     tstring *string = *inout;
-    // Bytes inside a block can't be freed by the caller, so they are copied.
+    // Bytes inside a block can't be freed by the caller; therefore they are copied.
     if (string->placed & ts_placed_bytes)
         CHECK_QUIET(allocate_own_bytes(string, std::max(string->size, ts_size_initial)));
     *out_text = string->buffer;

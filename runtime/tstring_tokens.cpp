@@ -125,7 +125,7 @@ lc_status append_byte(tstring *string, char c) {
     return LC_OK;
 }
 
-// `separated`: a separator follows the token, so an escape at its end has to be doubled.
+// `separated`: a separator follows the token, and an escape at its end has to be doubled.
 lc_status write_token(const token_syntax &syntax, const tstring *token, bool separated, tstring *out) {
     for (const char *at = token->buffer; *at; at++) {
         const char c = *at;

@@ -174,7 +174,7 @@ lc_status scale_to_us(int64_t value, int64_t factor, int64_t *out) {
 } // namespace
 
 // Defines lt_daytime_sec_to_buf for example, by way of lt_daytime_us_to_buf. `parameters` and `arguments` are
-// what the functions of a kind take besides the value, in parentheses.
+// the further parameters of the functions of a kind, in parentheses.
 #define LT_COARSER(kind, unit, type, factor, parameters, arguments)                                          \
     lc_status lt_##kind##_##unit##_to_buf(type value, LT_UNPAREN parameters uint32_t size, char *buffer) {   \
         int64_t us = 0;                                                                                      \
@@ -231,9 +231,9 @@ LT_TO_STR(dur_us, lt_dur_us, (), ())
 
 namespace {
 
-// Truncates to microseconds. Most decimal fractions have no exact representation as a double, so 0.000249
-// would become 248 microseconds; the correction is far below a microsecond, and makes every text that
-// lt_..._to_str writes read back as the same value.
+// Truncates to microseconds. Most decimal fractions have no exact representation as a double: 0.000249 would
+// become 248 microseconds; the correction is far below a microsecond, and makes every text that lt_..._to_str
+// writes read back as the same value.
 int64_t truncate_to_us(double seconds) {
     const double us = seconds * static_cast<double>(US_PER_SEC);
     return static_cast<int64_t>(us + us * 1e-15);

@@ -62,7 +62,7 @@ lc_status typed_takeover(Element *inout, Call call) {
 }
 template <typename Family, typename Element>
 using typed_foreach_function = lc_status (*)(Family *list, uint32_t index, Element element, void *data);
-// A foreach function of a family with what it needs, as the user data of the array's foreach.
+// A foreach function of a family with its arguments, as the user data of the array's foreach.
 template <typename Family, typename Element>
 struct typed_walk {
     typed_foreach_function<Family, Element> function;
