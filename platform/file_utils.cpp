@@ -1,4 +1,4 @@
-// Two file operations that are safe whatever already is at the path.
+// Two file operations that are safe whatever already exists at the path.
 //
 // A file is written under a temporary name in the same directory and then renamed, so that a reader sees
 // either the old or the new bytes, and a failed write, on a full disk for example, loses nothing. What is at
@@ -137,7 +137,7 @@ lc_status write_and_rename(const char *path, mode_t mode, const char *bytes, int
     }
     owned_fd file(mkostemp(temporary.text, O_CLOEXEC));
     if (file.fd < 0) {
-        // mkostemp has not created it, so it must not be deleted.
+        // mkostemp has not created it; it must not be deleted.
         temporary.text[0] = '\0';
         return status_of_errno();
     }

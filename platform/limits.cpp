@@ -1,10 +1,10 @@
 // The limits of the appliance.
 //
 // The file is read once, by the first call in any thread: tunnel ids and the size of the interface table
-// depend on these numbers, so they must not change in a running daemon.
+// depend on these numbers, which therefore must not change in a running daemon.
 //
 // Tunnel ids have 16 bits. max_user_tunnels is limited so that the last reserved encapsulation entry
-// (max_user_tunnels + 22 + 84) has one; a larger number is a bad line, and so is a max_interfaces of 0.
+// (max_user_tunnels + 22 + 84) has one; a larger number is a bad line, as is a max_interfaces of 0.
 
 #include "platform/limits.h"
 
@@ -80,7 +80,7 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
     }
     bool more = true;
     for (unsigned number = 1; more; number++) {
-        // By character, because fgets() would not show a NUL, nor that a line goes on.
+        // By character, because fgets() would not show a NUL, nor that a line continues.
         char line[128];
         size_t length = 0;
         bool good = true; // fits in the buffer and contains no NUL

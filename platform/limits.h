@@ -11,7 +11,7 @@ uint32_t get_max_user_tunnel_number(); // "max_user_tunnels", 200 by default
 uint32_t get_max_tunnel_number();      // the same plus the 22 tunnels of the system
 uint32_t qv_max_interfaces();          // "max_interfaces", 128 by default
 
-// What the first call of one of these reads: the numbers in the file, or the defaults.
+// The limits as the first call of one of these reads them: the numbers in the file, or the defaults.
 struct platform_limits {
     uint32_t max_user_tunnels;
     uint32_t max_interfaces;

@@ -14,11 +14,11 @@
 //
 // Scans. All interfaces are queried when a kind is started, when the socket's queue has overrun (because of
 // many changes, or a callback that took long), and when a notification is about an unknown interface.
-// Notifications that are older than the scan would undo its result, so the queue is emptied first. That drops
-// notifications of both kinds, and so each started kind reports every interface afterwards, changed or not.
-// An interface that is gone is reported as down; a name that belongs to another interface now is reported as
-// down, and then in its new state. Notifications that arrive during the scan are read after it and lead to
-// the latest state. A scan that fails is repeated after 200 ms.
+// Notifications that are older than the scan would undo its result; therefore the queue is emptied first.
+// That drops notifications of both kinds, and so each started kind reports every interface afterwards,
+// changed or not. An interface that is gone is reported as down; a name that belongs to another interface now
+// is reported as down, and then in its new state. Notifications that arrive during the scan are read after it
+// and lead to the latest state. A scan that fails is repeated after 200 ms.
 //
 // The thread still runs while the process is in exit(). Therefore no object here has a destructor, and only
 // the core of libnl is used, which has none either; libnl-route has tables that are destroyed at exit.

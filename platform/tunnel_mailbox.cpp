@@ -1,15 +1,15 @@
 // tunneld's functions on the mailbox, and what both sides share.
 //
-// Nothing here takes a lock: one thread of tunneld handles commands, and a role is a single load. Every field
-// is accessed as a whole and with acquire and release order, so that no access to an input is moved across an
-// access to `command`.
+// Nothing here takes a lock: one thread of tunneld handles commands, and a role is a single load without an
+// order. Every field of a command is accessed as a whole and with acquire and release order, so that no
+// access to an input is moved across an access to `command`.
 //
 // wccpd withdraws a command that isn't answered within about two seconds and may then write another one,
 // while tunneld is still reading the first. Therefore the inputs are read twice, and `command` before,
-// between and after: wccpd sets `command` to 0 before it changes an input, so if all agree and no 0 was seen,
-// the inputs belong to one command. After a thousand attempts (because there is no command any more, or wccpd
-// was interrupted while it wrote one) the reader uses what it has, and checks `command` again before it acts
-// on it.
+// between and after: wccpd sets `command` to 0 before it changes an input; therefore, if all agree and no 0
+// was seen, the inputs belong to one command. After a thousand attempts (because there is no command any
+// more, or wccpd was interrupted while it wrote one) the reader uses what it has, and checks `command` again
+// before it acts on it.
 
 #include "platform/tunnel_mailbox.h"
 
@@ -49,7 +49,7 @@ bool wccp_attach_mailbox() {
     return true;
 }
 
-// Both sides end a command by an exchange, so exactly one of them finds it still there.
+// Both sides end a command by an exchange: exactly one of them finds it still there.
 bool wccp_withdraw_command(wccp_tunnel_mailbox *mailbox) {
     return mailbox->command.exchange(MAILBOX_IDLE, std::memory_order_acq_rel) != MAILBOX_IDLE;
 }
