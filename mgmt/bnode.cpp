@@ -10,7 +10,7 @@
 #include "runtime/guards.h"
 #include "runtime/logging.h"
 
-// The number of calls of bn_binding_set_name, which tells arrays of bindings that their name index may be
+// The number of calls of bn_binding_set_name, by which arrays of bindings detect that their name index may be
 // outdated.
 std::atomic<uint32_t> bn_binding_renames;
 

@@ -10,8 +10,8 @@
 // Only ipaddr and ipprefix have no size: at offset 16 they have the family, in ipprefix the mask length, and
 // the address. An address is sent as one number of 128 bits, that is with its bytes reversed.
 //
-// What a peer sends is checked before any memory is allocated for it: the id must be valid, the size that of
-// the type, the length within the buffer, and a text must not contain a NUL. An attribute that is marked
+// Bytes from a peer are checked before any memory is allocated for them: the id must be valid, the size that
+// of the type, the length within the buffer, and a text must not contain a NUL. An attribute that is marked
 // invalid or absent has no value; the bytes in its place are skipped.
 #include <algorithm>
 #include <cstdlib>

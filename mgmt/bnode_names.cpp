@@ -1,6 +1,6 @@
-// Names and patterns. A search compares a pattern with each name of an array, so bn_pattern_matches works on
-// the text of the name directly and allocates nothing. tstr_array_wildcard_match does the same on parts; the
-// two must agree, which a test checks for all short names and patterns.
+// Names and patterns. A search compares a pattern with each name of an array; therefore bn_pattern_matches
+// works on the text of the name directly and allocates nothing. tstr_array_wildcard_match does the same on
+// parts; the two must agree, which a test checks for all short names and patterns.
 #include "mgmt/bnode_names.h"
 
 #include <cstdlib>

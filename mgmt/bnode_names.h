@@ -26,5 +26,5 @@ inline bool bn_escapes(const char *at) {
     return at[0] == '\\' && (at[1] == '\\' || at[1] == '/');
 }
 
-// The number of calls of bn_binding_set_name, see bn_binding.cpp.
+// The number of calls of bn_binding_set_name, see bnode.cpp.
 extern std::atomic<uint32_t> bn_binding_renames;

@@ -96,7 +96,7 @@ struct bn_request_msg {
     uint32_t transaction_id;
     tstring *audit_user; // who caused the request; or null
     bn_request_per_node_array *nodes;
-    bn_block *block;       // of which the nodes of a received message are part; or null
+    bn_block *block;       // contains the nodes of a received message; or null
     uint32_t flags;        // query: flags; set: commit flags
     tstring *text;         // query: database name; set: text; action: its name; event: its name
     uint32_t number;       // query: revision id condition; set: number
@@ -116,7 +116,7 @@ struct bn_response_msg {
     uint32_t db_revision_id; // query and set responses
 };
 
-// What a node of a request has besides its binding.
+// The fields of a request's node besides its binding.
 struct bn_node_info {
     uint32_t subop;
     uint32_t flags;

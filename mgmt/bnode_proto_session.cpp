@@ -126,7 +126,7 @@ bool is_session_connected(gcl_session *session) {
     return gcl_session_get_state(session, &state, nullptr) == LC_OK && state == GCL_SESSION_CONNECTED;
 }
 
-// What differs between sending the two kinds of message.
+// The differences between sending the two kinds of message.
 struct request_sending {
     static constexpr const char *title = "SEND REQ", *word = "request";
     static constexpr auto serialize = bn_request_msg_serialize;

@@ -2,15 +2,15 @@
 // a NUL.
 //
 //   header (below); request: audit user, string; response: return code, and return message, string
-//   node count, then for each node: id; absolute, 1 byte; number of name parts; each part as a string,
-//   without escapes;
+//   node count, then for each node:
+//     id; absolute, 1 byte; number of name parts; each part as a string, without escapes
 //     number of attributes; each attribute (bnode_attrib_wire.cpp); node trailer by message type
 //   message trailer by message type
 //
 // A received message is read twice. The first pass checks every field against the bytes received and adds up
 // the memory that the nodes need; the second pass fills a block (bnode_block.h) of that size. Both passes
-// read with the same functions, so they can't disagree. A message with a false count or length is refused
-// before anything is allocated for it. A node takes at most eight times its bytes on the wire.
+// read with the same functions and therefore can't disagree. A message with a false count or length is
+// refused before anything is allocated for it. A node takes at most eight times its bytes on the wire.
 #include <cstdlib>
 #include <cstring>
 
@@ -158,7 +158,7 @@ lc_status put_attributes(tbuffer *buffer, const bn_binding *binding) {
     return LC_OK;
 }
 
-// What is between the header and the nodes.
+// The fields between the header and the nodes.
 lc_status put_message_head(tbuffer *buffer, const bn_request_msg *msg) {
     CHECK_STATUS(put_string(buffer, msg->audit_user));
     return LC_OK;
@@ -276,8 +276,8 @@ lc_status get_revision(wire_reader *reader, bn_response_msg *msg) {
 
 // --- Reading nodes: measure_... are the first pass, place_... the second
 
-// A name in the buffer, and what it will be as text: its parts are escaped and joined. An absolute name
-// begins with a separator; if its first part is empty it has one already, and none is added.
+// A name in the buffer, and its form as text: its parts are escaped and joined. An absolute name begins with
+// a separator; if its first part is empty it has one already, and none is added.
 struct wire_name {
     const uint8_t *first; // where its first part begins
     uint32_t parts;
@@ -286,7 +286,7 @@ struct wire_name {
     bool bare;     // is "" or "/"
     size_t length; // of the text, in bytes
 };
-// What the first pass finds out for the second.
+// The results of the first pass, for the second.
 struct message_extent {
     bn_block_size size;
     bool escapes; // some name has a character that must be escaped
@@ -609,7 +609,7 @@ lc_status place_nodes(wire_reader *reader, uint32_t count, const Trailers *trail
         node->msg_type = msg->msg_type;
         CHECK_STATUS(get_u32(reader, &node->node_id));
         CHECK_STATUS(place_binding(reader, extent, &builder, &node->binding));
-        // The message owns the node from here on, so a later failure frees it with the message.
+        // The message owns the node from here on: a later failure frees it with the message.
         CHECK_STATUS(Kind::append(msg->nodes, &node));
         if (trailers->place_node)
             CHECK_STATUS(trailers->place_node(reader, &builder, Kind::node_at(msg->nodes, i)));

@@ -6,7 +6,7 @@
 
 #include "mgmt/bnode_types.h"
 
-// What the bytes of a value are.
+// The meaning of the bytes of a value.
 enum class value_shape : uint8_t { none, natural, integer, real, bytes, ipaddr, ipprefix, text, binary };
 
 // The families of the wire form (see the table in bnode_attrib_wire.cpp). `kind` is the first word of the
@@ -51,7 +51,7 @@ int64_t bn_value_integer(const bn_type_row *row, const bn_attrib *attrib);
 lc_status bn_text_to_natural(const char *text, uint64_t limit, uint64_t *out);
 lc_status bn_text_to_integer(const char *text, int64_t least, int64_t most, int64_t *out);
 
-// Gives a text in memory of malloc(), or LC_NULL, logged, if there was no memory for it.
+// Outputs a text in memory of malloc(), or returns LC_NULL, logged, if there was no memory for it.
 inline lc_status bn_give_text(char *text, char **out) {
     CHECK_NULL(text);
     *out = text;

@@ -64,8 +64,8 @@ lc_status mgmt_client_request(mgmt_client *client, bn_request_msg *request, bn_r
     if (exit_has_begun(client))
         return LC_CANCELLED;
     CHECK_STATUS(bn_request_msg_send(*client->session, request));
-    // A nested request overwrites what the outer one waits for, whose answer is then ignored. That is a
-    // mistake of the caller, and is logged.
+    // A nested request overwrites the id that the outer one waits for, whose answer is then ignored. That is
+    // a mistake of the caller, and is logged.
     if (*client->response_expected)
         (void)lc_check_condition(__func__, LC_FILE_NAME, __LINE__);
     *client->response_expected = 1;

@@ -2,8 +2,8 @@
 // process has one mgmt_client per session. It consists of pointers to variables of the program, which other
 // files use by name.
 //
-// mgmt_client_request runs the loop until the answer arrives, so everything else is handled in the meantime,
-// and requests nest. The wait ends with the answer, with the loss of the session, with a failure of the loop,
+// mgmt_client_request runs the loop until the answer arrives: everything else is handled in the meantime, and
+// requests nest. The wait ends with the answer, with the loss of the session, with a failure of the loop,
 // and, at every level of nesting, when the process begins to exit: from then on the loop returns at once, and
 // a wait for the answer alone would spin. A request that is not answered because of that, and one that is
 // made afterwards, is LC_CANCELLED, which is not logged, since an orderly exit is not a failure.

@@ -128,8 +128,8 @@ lc_status gcl_shutdown(gcl *instance) {
     CHECK_NULL(instance);
     const gcl_instance_guard guard(instance);
     lc_status result = LC_OK;
-    // A close calls the close handler, which may change the list, so it is searched from the start again
-    // after each.
+    // A close calls the close handler, which may change the list; therefore it is searched from the start
+    // again after each.
     for (gcl_session *session = instance->sessions; session;) {
         if (session->state == GCL_SESSION_CLOSED) {
             session = session->next;

@@ -2,10 +2,10 @@
 // used before the session is used by other threads. Both locks are held all the time, also while it waits.
 //
 // The calling thread has its signals blocked, because the event loop accepts them only while it waits itself.
-// A peer that never answers must not keep the process from ending, so the wait ends with LC_CANCELLED while
-// SIGHUP, SIGINT or SIGTERM is pending; the caller's event loop then handles the signal. A thread that
-// doesn't handle signals is told by the thread that does, by the flag `ending` of the instance. Both are
-// checked five times a second.
+// A peer that never answers must not keep the process from ending. Therefore the wait ends with LC_CANCELLED
+// while SIGHUP, SIGINT or SIGTERM is pending; the caller's event loop then handles the signal. A thread that
+// doesn't handle signals is notified by the thread that does, through the flag `ending` of the instance. Both
+// are checked five times a second.
 //
 // Each round works on a copy of the interests. A callback may remove an interest that is still to come in the
 // copy; that is harmless, because the interest's function checks the state of the session, whose record is
@@ -26,7 +26,7 @@ constexpr int64_t END_LOOK_MS = 200;
 
 namespace {
 
-// What a caller can wait for: a change of any of these.
+// A caller waits for a change of any of these.
 struct watched_state {
     uint64_t frames_sent, frames_received;
     int32_t session_state, protocol_state;

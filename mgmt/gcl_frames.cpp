@@ -14,8 +14,8 @@
 //
 // The output queue is limited in bytes. A frame that would exceed the limit is refused: the first one is
 // logged, the others are counted, and their number is logged when the queue has drained to half of the limit.
-// The sender gets LC_CANCELLED, which tells it not to wait for an answer, and which is not logged. If the
-// frame was a response, a short refusal is queued instead, for which the queue has a reserve.
+// The sender gets LC_CANCELLED, which is not logged, and must not wait for an answer. If the frame was a
+// response, a short refusal is queued instead, for which the queue has a reserve.
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -335,7 +335,7 @@ lc_status deliver_frame(gcl_session *session, tbuffer **inout_frame) {
         return LC_OK;
     }
     CHECK_CONDITION(handler->protocol == header.proto);
-    // Handler 0 is for all types, so its own type need not agree.
+    // Handler 0 is for all types; its own type need not agree.
     CHECK_CONDITION(handler->mtype == header.mtype || handler->mtype == 0);
     session->counters.frames_delivered++;
     session->counters.bytes_delivered += length;
@@ -428,7 +428,7 @@ lc_status read_activity(gcl_session *session) {
     uint32_t room = static_cast<uint32_t>(tb_avail(buffer));
     room = room < GCL_READ_MAX ? room : GCL_READ_MAX;
     int closed = 0;
-    // At most `room` bytes per call: the loop calls again while there is more, so other sessions get their
+    // At most `room` bytes per call: the loop calls again while there is more, and other sessions get their
     // turn.
     const int64_t got = lf_read_bytes_closed(session->fd, tb_buf(buffer) + length, room, &closed);
     LC_LOG(LC_LOG_DEBUG, "session %d: did read = %d", session->id, static_cast<int>(got));

@@ -1,6 +1,6 @@
 // The records of instances and sessions, for mgmt/gcl*.cpp only. The instance's lock guards its record and
-// the list of sessions; a session's record is used with both locks held, and so are the functions below that
-// take a session.
+// the list of sessions; a session's record is used with both locks held, as are the functions below that take
+// a session.
 #pragma once
 
 #include <atomic>

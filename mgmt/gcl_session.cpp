@@ -250,7 +250,7 @@ lc_status gcl_session_client_new(gcl *instance, const char *client_name, const s
     session->sequence = GCL_SEQUENCE_CLIENT;
     const lc_status status = set_up_session(session, client_name, address, length);
     if (status != LC_OK) {
-        // Nobody knows the session yet, so it is freed without gcl_session_close and its log lines.
+        // Nobody knows the session yet: it is freed without gcl_session_close and its log lines.
         if (session->fd >= 0)
             close(session->fd);
         if (session->fd >= 0 && session->local.path[0])
@@ -409,7 +409,7 @@ lc_status gcl_session_free(gcl_session **inout) {
     *inout = nullptr;
     if (!session)
         return LC_OK;
-    // Its lock could not be made, so it has nothing else either.
+    // The creation of its lock failed; nothing else was created.
     if (!session->lock) {
         free(session);
         return LC_OK;

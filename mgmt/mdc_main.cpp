@@ -26,7 +26,7 @@ lc_status mdc_init(mdc_send_function send, void *client_data, void *reserved_1, 
     CHECK_NULL(handle);
     *handle = {send, client_data, reserved_1, reserved_2, session};
     *out_handle = handle;
-    // The log can't call this room itself, so it is given the function.
+    // The log may not include this room; it is given the function instead.
     lc_log_facility_from_session = qv_read_log_facility;
     return LC_OK;
 }

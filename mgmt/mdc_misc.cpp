@@ -4,8 +4,8 @@
 // are put into a tree for the time of the query, and only names in that tree can be iterated. For a
 // registered wildcard ("/a/*") the daemon is asked for the names of the children.
 //
-// All of this runs in the session's callback. What a query can make this process do is limited: in the depth
-// and number of registered names, since the tree is processed recursively, and in the size of the answer.
+// All of this runs in the session's callback. The work that a query can cause is limited: in the depth and
+// number of registered names, since the tree is processed recursively, and in the size of the answer.
 #include <cstdlib>
 #include <cstring>
 
