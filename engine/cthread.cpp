@@ -1,18 +1,19 @@
 // Named threads.
 //
 // A context belongs to its creator until cthread_join frees it. While its thread is running and has not been
-// cancelled, the context is also on the process's thread list. The list has a mutex of its own, under which
-// no other lock is taken and no thread is waited for.
+// cancelled, the context is also on the process's thread list. The list has a mutex of its own; while it is
+// held, no other lock is taken and no thread is joined.
 //
 // Signals: all signals are blocked in these threads, so that only the main thread receives them and no sleep
 // or wait of the engine is cut short.
 //
-// Stacks: all memory of the process is locked, so the whole stack counts, used or not. 128 KiB is several
-// times what the deepest path of the engine needs with a packet of 4 KiB and the buffers of a log line.
+// Stacks: all memory of the process is locked; therefore the whole stack counts, used or not. 128 KiB is
+// several times what the deepest path of the engine needs with a packet of 4 KiB and the buffers of a log
+// line.
 //
 // Ending takes two steps, cancelling and joining. A caller can cancel while it holds a lock that the threads
 // may be waiting for, release the lock, and then join. All threads are cancelled before the first is joined,
-// so that the whole takes as long as the slowest one.
+// so that ending all of them takes only as long as the slowest one.
 
 #include "engine/cthread.h"
 

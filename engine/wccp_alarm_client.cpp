@@ -2,11 +2,11 @@
 //
 // Alarms and state events are sent by the engine's timer and receive threads, which may not touch the
 // daemon's working session; therefore they have a session of their own. The alarm thread only runs that
-// session's loop: it reads acknowledgements, writes what a full socket has left over, and notices a lost
-// connection. Senders call the session directly, with the engine lock held, and take the locks of this
-// client's own GCL instance. If a send needs a change of the loop's interest in a descriptor, the change is
-// posted to the loop and made by the alarm thread, so that no sender waits for the loop's lock. No callback
-// here takes the engine lock.
+// session's loop: it reads acknowledgements, writes queued data when a full socket has room again, and
+// notices a lost connection. Senders call the session directly, with the engine lock held, and take the locks
+// of this client's own GCL instance. If a send needs a change of the loop's interest in a descriptor, the
+// change is posted to the loop and made by the alarm thread, so that no sender waits for the loop's lock. No
+// callback here takes the engine lock.
 //
 // Start. The main thread waits for the alarm thread, which waits for mgmtd. The main thread runs its own loop
 // meanwhile, and the alarm thread's last step wakes it. An exit that begins in the meantime ends both waits;
@@ -123,7 +123,7 @@ lc_status start_alarm_session(const char *client_name) {
     return LC_OK;
 }
 
-// Ends the wait of the main thread. It may be waiting in its loop, so work is posted that does nothing.
+// Ends the wait of the main thread. It may be waiting in its loop; posting work that does nothing wakes it.
 void report_start() {
     static loop_post wake = {nullptr, nullptr, [](loop_post *, int) {}};
     loop_context *main_loop = nullptr;

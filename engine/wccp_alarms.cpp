@@ -3,8 +3,8 @@
 //
 // A bit in raised_alarms shows that an alarm is active. Each alarm has a check on a one-shot timer, which
 // runs 60 seconds after the first reason to check; later reasons do not delay it unless they ask to. Nothing
-// starts the timer again after the check, so alarms of a group in which nothing happens stay as they are. A
-// router that is removed, or that stops listing this appliance, raises the adjacency alarm at once.
+// starts the timer again after the check; alarms of a group in which nothing happens therefore stay as they
+// are. A router that is removed, or that stops listing this appliance, raises the adjacency alarm at once.
 //
 // Callers hold the engine lock, on the timer thread, a receive thread or the main thread. It guards the bits,
 // the timers and the buffers below. Messages are sent directly on the alarm session, and nothing waits for an
@@ -219,7 +219,7 @@ bool lacks_its_share(const wccp_rtr_view_appliance *entry) {
 }
 
 // Notes how much a router assigns to an appliance, or with 0.0.0.0 to all of them, and what was expected.
-// `wanted` 1 stands for any amount.
+// `wanted` 1 means any amount.
 void note_assignment_difference(wccp_service_group *group, const wccp_sending_router *router, be32 appliance,
                                 uint32_t has, uint32_t wanted) {
     const wccp_addr_text who = addr_text(appliance);
@@ -300,7 +300,7 @@ int wccp_alarms_verify_allocation_table(wccp_service_group *group) {
     const bool in_order =
         group->designated == 1 ? routers_use_our_table(group) : routers_redirect_without_holes(group);
     const bool raised = alarm_is_active(group, WCCP_ALARM_ASSIGNMENT);
-    wccp_forget_older_reasons(group, WCCP_REASON_ASSIGNMENT_DIFFERS); // what this check has noted stays
+    wccp_forget_older_reasons(group, WCCP_REASON_ASSIGNMENT_DIFFERS); // those of this check stay
     if (in_order && raised)
         wccp_alarm_clear_alarm(group, WCCP_ALARM_ASSIGNMENT);
     else if (!in_order && !raised)

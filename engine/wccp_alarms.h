@@ -22,7 +22,7 @@ void wccp_alarm_schedule_verify_allocation_table_timer(wccp_service_group *group
 // The checks, which raise or clear their alarm. 0, or 1 when the routers could not be counted.
 int wccp_alarm_verify_router_connectivity(wccp_service_group *group);
 int wccp_alarms_verify_allocation_table(wccp_service_group *group);
-// Raises the adjacency alarm if it is not active, and schedules its check anew.
+// Raises the adjacency alarm if it is not active, and schedules its check again.
 void wccp_alarm_raise_router_down_alarm(wccp_service_group *group);
 // Clears the group's active alarms and stops both checks.
 void wccp_alarms_clear_all_raised_alarms(wccp_service_group *group);

@@ -16,7 +16,7 @@
 // dsg_appliances has 32 entries. A report that replaces many appliances at once can need more, because down
 // entries are still in it. Down entries are then dropped, first the one with the fewest slots; slots of
 // others may move in this case. An appliance is added only if every router reports it, and a router reports
-// at most 32, so the active ones always fit.
+// at most 32; therefore the active ones always fit.
 //
 // Everything runs with the engine lock held, in a tick or on a receive thread. The only memory allocated are
 // the work arrays of a computation. Nothing depends on a clock or on random numbers: the seed is always 0.

@@ -2,9 +2,9 @@
 //
 // A complaint is a line at notice level or above that any number of packets can cause: what is wrong with a
 // packet or with what it reports, and what failed while it was processed, such as a new router's tunnel.
-// Anybody can send packets, so complaints are counted for the interface that the packet arrived on: after a
-// burst of 200 lines, 20 lines a second pass. The rest is suppressed, and the number of suppressed lines is
-// logged when the flood is over, or every minute while it lasts.
+// Anybody can send packets. Complaints are therefore counted for the interface that the packet arrived on:
+// after a burst of 200 lines, 20 lines a second pass. The rest is suppressed, and the number of suppressed
+// lines is logged when the flood is over, or every minute while it lasts.
 //
 // Functions log complaints with WCCP_COMPLAIN and need not know the interface: the receive thread opens a
 // scope for it. Outside a scope, for example in a tick, nothing is suppressed.

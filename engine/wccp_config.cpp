@@ -1,10 +1,10 @@
 // Service groups as configuration sees them: added, deleted, enabled, modified, started and stopped.
 //
 // The record of a group is linked from wccp_g.groups, wccp_g.group_list and its interface's list. Only the
-// main thread adds and deletes groups, so a new record is filled without the engine lock and linked with it.
-// Groups are also started and stopped by the notifier thread (wccp_link_mgr.cpp), and started by a tick when
-// their sockets have been recovered; the caller then holds the lock. Nothing keeps a pointer into a
-// wccp_grp_config.
+// main thread adds and deletes groups; therefore a new record is filled without the engine lock and linked
+// with it held. Groups are also started and stopped by the notifier thread (wccp_link_mgr.cpp), and started
+// by a tick when their sockets have been recovered; the caller then holds the lock. Nothing keeps a pointer
+// into a wccp_grp_config.
 //
 // Shutdown message. A group whose routers have learned of it sends a last Here-I-Am with the shutdown
 // command. It is sent while addresses, sockets and methods are still those that the routers know. A group in

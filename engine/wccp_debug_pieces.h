@@ -1,6 +1,6 @@
 // The parts of a diagnostic dump. A piece of text is formatted into a scratch buffer, truncated to its size,
 // and then appended to the caller's display buffer. A row is a label, its value and a newline. The scratch
-// buffers are shared by all dumps, so the lock must be held throughout.
+// buffers are shared by all dumps; therefore the lock must be held throughout.
 #pragma once
 
 #include "engine/wccp_records.h"

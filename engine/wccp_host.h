@@ -16,7 +16,7 @@ extern struct lew *wccpd_lwc; // the main thread's loop, null without one
 extern uint32_t g_qv_encap_wccp_first, g_qv_encap_wccp_last;
 
 // The name of the primary WAN interface, set by the function below. On failure it stays as it was. Main
-// thread; runs the event loop, so no lock may be held.
+// thread. It runs the event loop; therefore no lock may be held.
 extern char wccp_primary_wan_interface_name[32];
 lc_status wccp_init_primary_wan_interface();
 

@@ -1,5 +1,5 @@
 // The table of interfaces, wccp_g.interfaces. Entries are added at start and by wccp_add_group and are never
-// removed, so a pointer to one stays valid.
+// removed; a pointer to one therefore stays valid.
 
 #include "engine/wccp_interface.h"
 

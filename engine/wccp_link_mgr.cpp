@@ -5,19 +5,19 @@
 // alone change the state of an interface once it is in the table. Each checks for the exit twice, before it
 // takes the lock and again once it has it: a callback that waited while the groups were deleted must not open
 // sockets or create a receive thread after all threads have been joined. The notifier thread outlives the
-// engine, so whatever the callbacks use has no destructor.
+// engine; therefore nothing that the callbacks use has a destructor.
 //
 // The order of steps matters when an address changes. The shutdown messages of the groups need the old
 // sockets and address, and their tunnel references are found by the old address. New sockets, the groups' new
 // address and their start follow. When the address is removed, the ready bit is cleared first, so that no
 // shutdown message is sent from an address that is gone.
 //
-// An address notification only says that something has changed. The present address is read from the kernel,
-// so notifications that are late, duplicate or out of order have the same result. There is one case that the
-// address does not show: while a callback waits for the lock, an interface can be deleted and created again
-// with the same name and address. The multicast memberships of its socket were lost with the old device.
-// Therefore the interface keeps the index of the device that its sockets were opened on, and they are opened
-// again when that has changed.
+// An address notification only says that something has changed. The present address is read from the kernel;
+// therefore notifications that are late, duplicate or out of order have the same result. There is one case
+// that the address does not show: while a callback waits for the lock, an interface can be deleted and
+// created again with the same name and address. The multicast memberships of its socket were lost with the
+// old device. Therefore the interface keeps the index of the device that its sockets were opened on, and they
+// are opened again when that has changed.
 
 #include "engine/wccp_link_mgr.h"
 

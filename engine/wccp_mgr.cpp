@@ -69,7 +69,7 @@ int start_timer_thread() {
 
 int wccp_init_mgr() {
     QV_LOG(LC_LOG_INFO, "WCCP: Initialize WCCP manager");
-    new (&wccp_g) wccp_global{}; // it has atomics, so it cannot be assigned or zeroed by memset
+    new (&wccp_g) wccp_global{}; // its atomics rule out assignment and memset
     pthread_mutex_init(&wccp_g.lock, nullptr);
     wccp_g.mcast_ttl = DEFAULT_MCAST_TTL;
 

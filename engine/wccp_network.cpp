@@ -231,8 +231,8 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
             interface->network_error = errno;
             QV_LOG(LC_LOG_ERR, "WCCP: Interface %s: Cannot bind mcast UDP socket to %s:%d. %m",
                    interface->name, addr_text(address).s, WCCP_PORT);
-            // The first send would bind this socket to a port of the kernel's choice, so a retry needs a new
-            // one.
+            // The first send would bind this socket to a port of the kernel's choice; therefore a retry needs
+            // a new one.
             interface->network_flaws |= WCCP_FLAW_SOCKETS;
             return 1;
         }

@@ -4,8 +4,8 @@
 //   mask SRC_IP DST_IP SRC_PORT DST_PORT members A B owners A*21 B*43
 //
 // Masks are hexadecimal without a prefix. Members are the appliances of the view. Owners are listed in the
-// order of the slots, each with the length of its run; 0.0.0.0 stands for no owner. Slot i of a mask is value
-// i in the order of wccp_mask_assignment.cpp. The owners come from the table of this appliance if it is
+// order of the slots, each with the length of its run; 0.0.0.0 means no owner. Slot i of a mask is value i in
+// the order of wccp_mask_assignment.cpp. The owners come from the table of this appliance if it is
 // designated, otherwise from the routers' reports. They are omitted when neither is known.
 #pragma once
 

@@ -2,9 +2,9 @@
 // kinds of packet that this appliance sends.
 //
 // Reception runs on the receive thread of an interface, whose stack holds the packet. Transmission runs on
-// the timer thread or on the thread that stops a group. Both hold the engine lock throughout, so the group's
-// single transmit packet needs no other protection. It is built anew for every Here-I-Am and Redirect-Assign;
-// a removal reply is built when its query arrives and is sent unchanged each time.
+// the timer thread or on the thread that stops a group. Both hold the engine lock throughout; therefore the
+// group's single transmit packet needs no other protection. It is rebuilt for every Here-I-Am and
+// Redirect-Assign; a removal reply is built when its query arrives and is sent unchanged each time.
 //
 // Anybody can send to the port. The order of checks is: length, version, type, group, security, contents.
 // Only a complete I-See-You from a router that may join reaches the group's records; up to that point only

@@ -12,7 +12,7 @@
 // 16 can wrap.
 //
 // After a component of odd length everything that follows is at odd addresses. The wire layouts have
-// alignment 1, so they can be read anywhere.
+// alignment 1 and can be read at any address.
 //
 // A refused component leaves the cursor where it was. The caller logs which step failed and drops the
 // message.
@@ -54,7 +54,7 @@ const T *peek_layout(const wccp_pkt *pkt, uint64_t distance = 0, uint64_t count 
     return peek_layout<T>({pkt->data + pkt->offset, count_remaining_bytes(pkt)}, distance, count);
 }
 
-// Moves the cursor past `size` bytes. 1, and it stays, when they were not received.
+// Moves the cursor past `size` bytes. Returns 1 and leaves the cursor in place when they were not received.
 int skip_bytes(wccp_pkt *pkt, uint64_t size) {
     if (size > count_remaining_bytes(pkt))
         return 1;
@@ -63,7 +63,7 @@ int skip_bytes(wccp_pkt *pkt, uint64_t size) {
     return 0;
 }
 
-// These note why a message is refused, with what it has and what it should have, and return 1.
+// These note the reason for refusing a message, with the values found and expected, and return 1.
 int refuse_message(wccp_service_group *group, const wccp_pkt *pkt, const wccp_reason_text &has,
                    const wccp_reason_text &should_have,
                    wccp_reason_code code = WCCP_REASON_MESSAGE_MALFORMED) {
@@ -325,7 +325,7 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
         decoded->weight = to_host(*weight);
         hash_summary->mask_forms |= by_hash ? 0 : 1u << i;
         if (shape.form == WCCP_ELEMENT_REDIRECT) {
-            hash_summary->valid = 0; // the assignment comes as an Assignment Map
+            hash_summary->valid = 0; // the assignment is in an Assignment Map
         } else if (by_hash && flags & WCCP_IDENTITY_HISTORICAL) {
             QV_LOG(LC_LOG_INFO, "WCCP GRP %d: app id. %s assignment is historical, ignored", group->id,
                    addr_text(decoded->ipa).s);
@@ -461,7 +461,8 @@ uint16_t wccp_pkt_next_component_type(const wccp_pkt *pkt) {
 
 int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt) {
     const auto *head = peek_layout<wccp_wire_component>(pkt);
-    // A component of one to three bytes has no head; it is refused below with what there is of its type.
+    // A component of one to three bytes has no head; it is refused below with the bytes of its type that were
+    // received.
     const int type = wccp_pkt_next_component_type(pkt), length = head ? to_host(head->length) : 0;
     if (head && skip_bytes(pkt, sizeof *head + to_host(head->length)) == 0)
         return 0;

@@ -70,7 +70,7 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
 // counts.
 int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt *pkt,
                                              wccp_assign_map_info *out);
-// Changes in `out` what the component has; the caller initialises it with the defaults.
+// Overwrites in `out` the values that the component has; the caller initialises it with the defaults.
 int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pkt *pkt,
                                               wccp_rtr_capabilities *out);
 int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *pkt, wccp_command_info *out);
@@ -82,7 +82,7 @@ uint16_t wccp_pkt_next_component_type(const wccp_pkt *pkt);
 int wccp_pkt_unload_unknown_component(wccp_service_group *group, wccp_pkt *pkt);
 // Decodes `count` web-cache elements in their order and adds up what those of hash assignment assign.
 // `decoded` has WCCP_MAX_APPLIANCES entries, which the caller has zeroed. Also 1 for a null argument.
-// `hash_summary` is not valid when an element says that the assignment comes as a map.
+// `hash_summary` is not valid when an element indicates that the assignment is in a map.
 int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, uint32_t count,
                                                    wccp_view_elements elements,
                                                    wccp_rtr_view_appliance *decoded,

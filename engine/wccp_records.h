@@ -251,7 +251,7 @@ struct wccp_service_group {
     wccp_timer monitor_timer;
     wccp_timer router_alarm_timer;
     wccp_timer assign_alarm_timer;
-    wccp_pkt *tx_pkt; // owned; built anew for each Here-I-Am and Redirect-Assign
+    wccp_pkt *tx_pkt; // owned; rebuilt for each Here-I-Am and Redirect-Assign
     uint16_t raised_alarms;
     uint32_t transitions;
     uint32_t rx_icus;

@@ -3,7 +3,7 @@
 // A record is created by a router's first I-See-You if its capabilities can be agreed. It lives until the
 // router has sent none for 40 seconds or the group stops. The first router decides the group's forwarding,
 // assignment and return methods; they stay in force until the last router is removed. The records belong to
-// the group's list, and so do the replies to Removal Queries, each a finished message with the number of its
+// the group's list, as do the replies to Removal Queries, each a finished message with the number of its
 // remaining transmissions. The number of queued replies is limited for each router.
 //
 // The engine lock is held throughout: by a receive thread for the creation, the capability decision and
@@ -227,7 +227,7 @@ void remove_silent_router(wccp_service_group *group, wccp_sending_router *router
     drop_view_references(group, router);
     if (router->flags & WCCP_RTR_HAS_TUNNEL)
         wccp_del_tunnel(group->id, group->appliance_ipa, router->router_id, 0);
-    if (group->sending_router_count == 1) { // it was the last one: the next router decides anew
+    if (group->sending_router_count == 1) { // it was the last one: the next router decides again
         group->fwd_method = WCCP_METHOD_NONE;
         group->assign_method = WCCP_ASSIGN_NONE;
         group->ret_method = WCCP_METHOD_NONE;

@@ -12,7 +12,8 @@ wccp_sending_router *wccp_find_sending_router(wccp_service_group *group, be32 ro
 int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,
                                      const wccp_rtr_capabilities *offered, wccp_rtr_capabilities *out_agreed,
                                      uint32_t *out_compatible);
-// For a router with a record: notes as a reason what it no longer offers although the group uses it.
+// For a router with a record: notes as a reason each method that the group uses and the router no longer
+// offers.
 void wccp_check_offered_methods(wccp_service_group *group, be32 router_id,
                                 const wccp_rtr_capabilities *offered);
 // Creates a record with the agreed methods, and for GRE a tunnel, which may wait for tunneld for some 2

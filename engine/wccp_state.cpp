@@ -210,7 +210,7 @@ bool all_routers_are_two_way(wccp_service_group *group) {
         const wccp_sending_router *router = wccp_find_sending_router(group, entry->ipa);
         if (router && router->flags & WCCP_RTR_TWO_WAY)
             continue;
-        all = false; // go on, so that a reason is noted for each of them
+        all = false; // continue, so that a reason is noted for each of them
         wccp_note_reason(group, WCCP_REASON_ELECTION_BLOCKED, entry->ipa,
                          wccp_reason_value("%s", router ? "one-way" : "no I-See-You"),
                          wccp_reason_value("two-way"));

@@ -1,6 +1,6 @@
 // The process-wide table of GRE tunnels.
 //
-// Each record stands for one pair of this appliance's address and a router's id. Service groups with the same
+// Each record is for one pair of this appliance's address and a router's id. Service groups with the same
 // pair share the tunnel and are counted in `ref_count`. Tunnel ids come from a range of 32; a clear bit in
 // tunnel_free_ids means that a record has the id or an add for it is in progress. Commands to tunneld go
 // through the mailbox (wccpd_common.cpp), which waits for the answer.
@@ -177,8 +177,8 @@ int wccp_del_tunnel(uint32_t group_id, be32 local, be32 remote, int force) {
     return 1;
 }
 
-// The mutex is released between two deletes, so no pointer into the list may be kept. Each delete removes the
-// head.
+// The mutex is released between two deletes; therefore no pointer into the list may be kept. Each delete
+// removes the head.
 int wccp_del_all_tunnels() {
     for (;;) {
         be32 local, remote;

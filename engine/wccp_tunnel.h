@@ -2,8 +2,8 @@
 //
 // The functions take the tunnel mutex themselves, after the engine lock if the caller holds that. They wait
 // for tunneld, up to about 2 seconds for each command; an add does so without the mutex, a delete and a
-// restore with it. `group_id`, of which the low 8 bits count, is only for the log and for reasons; 0 stands
-// for no group.
+// restore with it. `group_id` is only for the log and for reasons; only its low 8 bits count, and 0 means no
+// group.
 #pragma once
 
 #include "engine/wccp_records.h"

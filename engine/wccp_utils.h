@@ -20,8 +20,8 @@ void *wccp_calloc(uint32_t count, uint32_t size);
 void *wccp_malloc(uint32_t size);
 void wccp_free(void *memory); // null: nothing
 
-// Writes "days:hours:minutes:seconds", no part padded, into `buffer`. `length` is its size in bytes, of which
-// the low 8 bits count; below 32 nothing is written.
+// Writes "days:hours:minutes:seconds", no part padded, into `buffer`. `length` is its size in bytes; only the
+// low 8 bits count, and below 32 nothing is written.
 void wccp_seconds_to_str(uint32_t seconds, char *buffer, uint32_t length);
 
 // The dotted text of an address, returned by value so that addr_text(ipa).s can be an argument of a log line.

@@ -11,8 +11,8 @@ struct wccp_assign_summary;
 //
 // 0, or 1 when something failed. More than 32 entries: nothing has changed. Otherwise the whole report has
 // been applied except for the entries that there was no memory for; these are in neither the report nor the
-// union, so the next report adds them. A changed weight that leaves the designated appliance without anybody
-// to redirect to, and an appliance that is missing in the union, also give 1.
+// union; therefore the next report adds them. A changed weight that leaves the designated appliance without
+// anybody to redirect to, and an appliance that is missing in the union, also give 1.
 int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,
                             const be32 *addresses);
 int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *router, uint32_t count,

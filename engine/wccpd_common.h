@@ -15,10 +15,11 @@ int wccp_init_shmem();
 int wccp_cleanup_shmem();
 
 // Commands. Each waits up to about 2 seconds for tunneld's answer. After one that timed out, adds and L2
-// returns fail at once for up to 10 seconds, and further deletes are sent without waiting; during the exit
-// nothing is waited for after the first time-out. Addresses are in host order. They return tunneld's status,
-// in which 1 is failure, or 1 without an answer. `inout_index` is the data plane's index of the tunnel and is
-// changed by an answer only; an add that is answered with WCCP_NO_INDEX has failed.
+// returns fail at once for up to 10 seconds; after a delete that timed out, further deletes are sent without
+// waiting for their answers. During the exit nothing is waited for after the first time-out. Addresses are in
+// host order. They return tunneld's status, in which 1 is failure, or 1 without an answer. `inout_index` is
+// the data plane's index of the tunnel and is changed by an answer only; an add that is answered with
+// WCCP_NO_INDEX has failed.
 int wccp_add_tunnel_encap(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
                           uint32_t *inout_index);
 // The same; when it fails, `out_failure` is the reason.
