@@ -4,14 +4,15 @@
 // put the event on a ready list. When event_base_loop has returned, ready events move to the end of a queue,
 // and loop_run calls their functions from there. Such a function may call loop_run again: the inner rounds
 // collect further events and continue with the same queue, what is left of the outer round first. An event
-// that is removed or freed also leaves the queue, so a function is never called for an event that an earlier
+// that is removed or freed also leaves the queue: a function is never called for an event that an earlier
 // function has removed. An event is not accessed after its function has been called, which may have freed it.
 // While the queue is not empty, the next round polls the descriptors without waiting.
 //
 // Threads. Only the owner thread calls libevent. Another thread that needs a change posts it to a list, whose
 // mutex is never held while another lock is taken; the owner carries it out before its next callback. Posting
-// does not wait, so the poster may hold any lock. If the list was empty, the poster wakes the owner through
-// the self-pipe. Posted work counts as something that ran, so that a wait for one round sees what it changed.
+// does not wait; the poster may therefore hold any lock. If the list was empty, the poster wakes the owner
+// through the self-pipe. Posted work counts as something that ran, so that a wait for one round sees what it
+// changed.
 //
 // Lock. The loop's lock is recursive and held during all callbacks. The wait releases it completely, whatever
 // its depth, and takes it again to the same depth. A nested wait thus takes it while it holds the locks of
@@ -493,7 +494,7 @@ lc_status wait_for_events(loop_context *context) {
     if (!without_waiting && !context->timers && event_add(context->limit_event, &limit) != 0)
         FAIL_WITH(LC_GENERIC);
     const sigset_t signals = context->owned_signals;
-    const uint32_t held = context->lock.count; // this thread holds the lock, so the count is stable
+    const uint32_t held = context->lock.count; // stable, because this thread holds the lock
     give_loop_lock(&context->lock, held);
     pthread_sigmask(SIG_UNBLOCK, &signals, nullptr);
     const int result = event_base_loop(context->base, EVLOOP_ONCE | (without_waiting ? EVLOOP_NONBLOCK : 0));

@@ -165,7 +165,7 @@ lc_status wccpd_config_update_group(const char *id_text, const config_walk *walk
     if (wccp_add_group(&config) == 0)
         QV_LOG(LC_LOG_INFO, "Created WCCP group %d", id);
     else
-        QV_LOG(LC_LOG_ERR, "FAILED to create WCCP group %d", id); // the walk goes on with the next group
+        QV_LOG(LC_LOG_ERR, "FAILED to create WCCP group %d", id); // the walk continues with the next group
     return LC_OK;
 }
 
@@ -261,7 +261,7 @@ const group_node *find_changing_node(const char *name) {
     return nullptr;
 }
 
-// Applies a changed or deleted node of a group. Some changes a running group cannot follow: a deleted node
+// Applies a changed or deleted node of a group. A running group cannot follow some changes: a deleted node
 // deletes the group, and router entries, priority and protocol are fixed. If the answer contains the change
 // there is nothing to do for these, because the group was added with their new values.
 lc_status change_group(const char *name, const tstr_array *parts, const bn_binding *binding, bool deleted,

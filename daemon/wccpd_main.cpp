@@ -5,22 +5,23 @@
 // callback may wait for mgmtd by running the loop again from inside itself (wccpd_mgmt.cpp).
 // wccpd_initiate_exit can therefore run nested in such a wait; every wait ends once wccpd_exiting is set.
 //
-// Start. The engine asks mgmtd for the system mode and the primary interface, so the session must be open
-// before it; the alarm session must be open before the engine can raise an alarm. m_daemon_status alone shows
-// how far the start has come. Until it is WCCPD_READY, queries are dropped and configuration changes are kept
-// (wccpd_early_changes.h). A start that fails does not end the process: it stays in its loop, not ready and
-// ignoring changes, until a signal ends it. Only a missing privilege ends it at once.
+// Start. The session with mgmtd must be open before the engine starts, because the engine asks mgmtd for the
+// system mode and the primary interface; the alarm session must be open before the engine can raise an alarm.
+// m_daemon_status alone shows how far the start has come. Until it is WCCPD_READY, queries are dropped and
+// configuration changes are kept (wccpd_early_changes.h). A start that fails does not end the process: it
+// stays in its loop, not ready and ignoring changes, until a signal ends it. Only a missing privilege ends it
+// at once.
 //
 // Exit. Alarms are cleared while their session is open. Then the alarm session and its thread end, the signal
 // registrations are removed, the working session is closed, and the mailbox is reset. Groups are still
 // running at this point, with the tick idle; wccpd_deinit deletes them once the loop has returned. The daemon
-// never reconnects and never repairs anything; whatever launched it starts it again.
+// never reconnects and never repairs anything; its supervisor starts it again.
 //
 // The notifier thread of the platform's library runs until exit() has finished and can call into the engine
 // until then. Therefore the engine's records have no destructors, and its callbacks return at once when
 // wccpd_exiting is set.
 //
-// All memory is locked, so every mapped page counts whether it is used or not. Threads have small stacks
+// All memory is locked; therefore every mapped page counts, used or not. Threads have small stacks
 // (engine/cthread.cpp), malloc has one arena and returns large buffers to the kernel, and received bindings
 // share their names. scripts/memory.sh shows locked memory by component; bench/daemon_start.sh measures at
 // full size.

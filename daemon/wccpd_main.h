@@ -33,6 +33,6 @@ lc_status wccpd_serv_init(); // starts the engine
 lc_status wccpd_pid_init();  // writes the pid file
 lc_status wccpd_handle_signal(int signal_number, short flags, void *data, lew *context); // a lew_callback
 // Begins the orderly exit. Called from a callback of the loop, which ends after it. When a step fails, the
-// status is returned, the rest is not done, and the loop goes on.
+// status is returned, the rest is not done, and the loop continues.
 lc_status wccpd_initiate_exit();
 uint32_t qv_encap_setup_entries(); // computes the ranges; returns the size of the table

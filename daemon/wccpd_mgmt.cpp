@@ -2,8 +2,8 @@
 // does.
 //
 // Everything runs on the main thread inside the loop, and nests: the daemon waits for the answer to a request
-// of its own by running the loop again (mgmt/client_session.h), so events, queries and the loss of the
-// session are handled in the middle of the wait. The exception are configuration changes during the start,
+// of its own by running the loop again (mgmt/client_session.h); therefore events, queries and the loss of the
+// session are handled in the middle of the wait. The exceptions are configuration changes during the start,
 // which are kept until the whole configuration has been read. Handlers run with the session's recursive locks
 // held; the engine takes its lock after them. A handler that fails does not end the session. The session is
 // never reopened: when it is lost, or when mgmtd reports the end of tunneld, the daemon exits.

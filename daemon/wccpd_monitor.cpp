@@ -265,7 +265,7 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
     subject->group = static_cast<uint8_t>(get_number_part(subject, GROUP_PART));
     const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
     const int group = static_cast<int>(group_text ? strtol(group_text, nullptr, 10) : 0);
-    // These are prefixes of text, so they match the parent nodes themselves, too; their numbers are then 0.
+    // These are prefixes of text and therefore also match the parent nodes; the numbers are then 0.
     snprintf(routers, sizeof routers, "%s/%d/router", NODE_GROUP_STATE, group);
     snprintf(appliances, sizeof appliances, "%s/%d/appliance", NODE_GROUP_STATE, group);
     if (!lc_is_prefix(routers, subject->name, 0)) {

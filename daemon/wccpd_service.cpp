@@ -1,5 +1,5 @@
-// The daemon needs few privileges: its port does not need root, and network interfaces are tunneld's
-// business. It needs permission to lock its memory and access to mgmtd.
+// The daemon needs few privileges: its port does not need root, and only tunneld changes network interfaces.
+// It needs permission to lock its memory and access to mgmtd.
 //
 // All memory is locked when it is mapped. With a limit below what the daemon needs in the end, threads cannot
 // be created, groups cannot be added and shared memory cannot be attached, at some point in its life. A limit
