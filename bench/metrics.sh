@@ -1,8 +1,8 @@
 #!/bin/bash
-# metrics.sh [BIN [GROUPS [SCRAPES]]]: what a scrape of the metrics costs with that many groups (256) of 32 routers, over
-# HTTP as the socket unit serves it: the time from the request to the last byte, the processor time of each program, the
-# size plain and compressed, the number of series, and how long the engine lock was held for it at most. The floor is the
-# time of a request that is answered without asking anybody (404).
+# metrics.sh [BIN [GROUPS [SCRAPES]]]: measures the cost of a scrape of the metrics with that many groups (256) of 32
+# routers, over HTTP as the socket unit serves it: the time from the request to the last byte, the processor time of
+# each program, the size plain and compressed, the number of series, and how long the engine lock was held for it at
+# most. The floor is the time of a request that is answered without a query (404).
 #
 #   METRICS_KEEP    a file for the text of the last scrape
 set -u
@@ -50,7 +50,7 @@ done
 sleep 1.2
 [ "$(tail -n 1 "$LAB/metrics")" != "" ] && [ "$(grep -c '^wccp_router_heard_seconds' "$LAB/metrics")" = $((groups * 32)) ] || die "not all routers are there: $(head -c 300 "$LAB/metrics")"
 echo "request to last byte: $(summary <"$LAB/times")"
-echo "a request that asks nobody: $(summary <"$LAB/floor")"
+echo "a request without a query: $(summary <"$LAB/floor")"
 echo "size: $(wc -c <"$LAB/metrics") bytes, gzip -1 $(gzip -1 <"$LAB/metrics" | wc -c), gzip -6 $(gzip <"$LAB/metrics" | wc -c)"
 echo "series: $(grep -vc '^#' "$LAB/metrics")"
 tail -n +$((lines + 2)) "$LAB/a1-wccpd.out" | awk '/ main / { holds += $12; max = $14 > max ? $14 : max; cpu = $16 > cpu ? $16 : cpu; all = $7 > all ? $7 : all }

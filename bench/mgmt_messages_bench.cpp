@@ -26,7 +26,7 @@ seconds time_of(Step step) {
     step();
     return thread_time() - start;
 }
-void require(bool condition, const char *what) {
+void require_true(bool condition, const char *what) {
     if (condition)
         return;
     fprintf(stderr, "%s\n", what);
@@ -36,7 +36,7 @@ void require(bool condition, const char *what) {
 struct socket_pair {
     int ends[2] = {-1, -1};
     std::string taken = std::string(1 << 18, '\0');
-    socket_pair() { require(socketpair(AF_UNIX, SOCK_STREAM, 0, ends) == 0, "socketpair"); }
+    socket_pair() { require_true(socketpair(AF_UNIX, SOCK_STREAM, 0, ends) == 0, "socketpair"); }
     ~socket_pair() {
         close(ends[0]);
         close(ends[1]);
@@ -46,7 +46,7 @@ struct socket_pair {
         const auto *at = static_cast<const char *>(bytes);
         while (length) {
             const size_t piece = length < 65536 ? length : 65536;
-            require(send(ends[from], at, piece, 0) == static_cast<ssize_t>(piece), "send");
+            require_true(send(ends[from], at, piece, 0) == static_cast<ssize_t>(piece), "send");
             for (size_t got = 0; got < piece;)
                 got += static_cast<size_t>(recv(ends[1 - from], taken.data(), piece - got, 0));
             at += piece;
@@ -56,16 +56,16 @@ struct socket_pair {
 };
 
 void fill_response(bn_response_msg **out, int64_t bindings) {
-    require(bn_query_response_msg_create(out, 1, 0, nullptr) == LC_OK, "create");
+    require_true(bn_query_response_msg_create(out, 1, 0, nullptr) == LC_OK, "create");
     (*out)->service_id = 2;
     for (int64_t i = 0; i < bindings; i++) {
         bn_binding *binding = nullptr;
         const std::string name =
             "/qv/wccpd/wccp/srv_grp/config/" + std::to_string(i / 40) + "/field/" + std::to_string(i % 40);
-        require(bn_binding_new_str(&binding, name.c_str(), bn_attrib_value, bn_type_str, 0, "a value") ==
-                        LC_OK &&
-                    bn_query_response_msg_append_binding_takeover(*out, &binding, 1000) == LC_OK,
-                "binding");
+        require_true(bn_binding_new_str(&binding, name.c_str(), bn_attrib_value, bn_type_str, 0, "a value") ==
+                             LC_OK &&
+                         bn_query_response_msg_append_binding_takeover(*out, &binding, 1000) == LC_OK,
+                     "binding");
     }
 }
 
@@ -98,7 +98,8 @@ void write_message(benchmark::State &state) {
     owned_response msg;
     owned_tbuffer first;
     fill_response(&msg.pointer, state.range(0));
-    require(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &first.pointer) == LC_OK, "write");
+    require_true(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &first.pointer) == LC_OK,
+                 "write");
     measure_with_floor(state, 1, state.range(0), first.pointer->length, 0, [&] {
         owned_tbuffer buffer;
         (void)bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &buffer.pointer);
@@ -110,7 +111,8 @@ void read_message(benchmark::State &state) {
     owned_response msg;
     owned_tbuffer bytes;
     fill_response(&msg.pointer, state.range(0));
-    require(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &bytes.pointer) == LC_OK, "write");
+    require_true(bn_response_msg_serialize(msg.pointer, BN_FRAME_HEADER_BYTES, &bytes.pointer) == LC_OK,
+                 "write");
     measure_with_floor(state, 1, state.range(0), bytes.pointer->length, 0, [&] {
         owned_response read;
         (void)bn_response_msg_deserialize(bytes.pointer, BN_FRAME_HEADER_BYTES, &read.pointer);
@@ -128,8 +130,9 @@ struct answered_session : hand_session {
         return LC_OK;
     }
     answered_session() {
-        require(bn_set_global_callback_query_response_msg(instance, take_answer, this) == LC_OK && open(),
-                "open");
+        require_true(bn_set_global_callback_query_response_msg(instance, take_answer, this) == LC_OK &&
+                         open(),
+                     "open");
     }
     void answer(const std::string &frames, int64_t messages) {
         answers = 0;
@@ -141,11 +144,11 @@ struct answered_session : hand_session {
             idle += at == frames.size();
             read();
         }
-        require(answers == messages, "an answer is missing");
+        require_true(answers == messages, "an answer is missing");
     }
     static std::string frame_of(bn_response_msg *msg) {
         owned_tbuffer bytes;
-        require(bn_response_msg_serialize(msg, 0, &bytes.pointer) == LC_OK, "write");
+        require_true(bn_response_msg_serialize(msg, 0, &bytes.pointer) == LC_OK, "write");
         return frame_bytes(
             BN_PROTO, msg->msg_type,
             std::string(reinterpret_cast<const char *>(tb_buf(bytes.pointer)), bytes.pointer->length));

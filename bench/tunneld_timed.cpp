@@ -46,7 +46,7 @@ constexpr double LIMIT = 5;                                     // seconds; of e
     fprintf(stderr, "tunneld_timed: %s: %s\n", what.c_str(), strerror(errno));
     exit(1);
 }
-double now() {
+double seconds_now() {
     timespec time = {};
     clock_gettime(CLOCK_MONOTONIC, &time);
     return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9;
@@ -102,7 +102,7 @@ void fill_packet(uint8_t *packet, size_t *out_length) {
         uint8_t came[2048];
         while (recv(fd, came, sizeof came, 0) > 0)
             if (times->sends && times->returned_at == 0)
-                times->returned_at = now();
+                times->returned_at = seconds_now();
         if (times->sends)
             (void)!sendto(fd, packet, length, 0, reinterpret_cast<const sockaddr *>(&to), sizeof to);
         sleep_for(times->sends ? 0.0002 : 0.001);
@@ -129,15 +129,15 @@ void start_router() {
 wccp_tunnel_mailbox *mailbox;
 
 // Gives a command as wccpd does; false if it fails or is not answered.
-bool command(uint16_t code, uint16_t id) {
+bool run_mailbox_command(uint16_t code, uint16_t id) {
     mailbox->tunnel_id = id;
     mailbox->local_ip = APPLIANCE;
     mailbox->remote_ip = ROUTER;
     mailbox->fmst_index = WCCP_NO_INDEX;
     mailbox->command = code;
     wccp_wake_tunneld();
-    for (const double end = now() + LIMIT; mailbox->command != 0;) {
-        if (now() > end)
+    for (const double end = seconds_now() + LIMIT; mailbox->command != 0;) {
+        if (seconds_now() > end)
             return false;
         sleep_for(0.0002);
     }
@@ -171,19 +171,19 @@ void order_and_wait(uint16_t id) {
     times->sends = true;
     sleep_for(0.002);
     times->returned_at = 0; // nothing is returned while the tunnel does not exist
-    const double ordered = now();
-    if (!command(MAILBOX_ADD_TUNNEL, id) || mailbox->fmst_index == WCCP_NO_INDEX)
+    const double ordered = seconds_now();
+    if (!run_mailbox_command(MAILBOX_ADD_TUNNEL, id) || mailbox->fmst_index == WCCP_NO_INDEX)
         die("the order is not answered");
-    const double answered = now();
+    const double answered = seconds_now();
     while (times->returned_at == 0) {
-        if (now() > ordered + LIMIT)
+        if (seconds_now() > ordered + LIMIT)
             die("no packet comes back");
         sleep_for(0.0002);
     }
     printf("%.1f %.1f\n", (answered - ordered) * 1e3, (times->returned_at - ordered) * 1e3);
     fflush(stdout);
     times->sends = false;
-    if (!command(MAILBOX_DELETE_TUNNEL, id))
+    if (!run_mailbox_command(MAILBOX_DELETE_TUNNEL, id))
         die("the tunnel is not removed");
     sleep_for(0.02);
 }
@@ -194,7 +194,7 @@ int run_orders(char **words) {
     start_router();
     const pid_t tunneld = start_tunneld(words[0]);
     // The first order waits until tunneld has found the mailbox and made its rules.
-    if (!command(MAILBOX_ADD_TUNNEL, 1) || !command(MAILBOX_DELETE_TUNNEL, 1))
+    if (!run_mailbox_command(MAILBOX_ADD_TUNNEL, 1) || !run_mailbox_command(MAILBOX_DELETE_TUNNEL, 1))
         die("tunneld takes no command");
     for (int i = 0; i < atoi(words[1]); i++) {
         sleep_for(strtod(words[2], nullptr));
@@ -231,7 +231,7 @@ appliance_view view_of(uint16_t tunnels, int groups) {
     return view;
 }
 void reconcile_timed(const char *what, const data_plane &plane, const appliance_view &view, bool takes_over) {
-    const double began = now();
+    const double began = seconds_now();
     std::map<std::string, uint32_t> indices;
     std::string error;
     std::vector<wanted_link> found;
@@ -243,7 +243,7 @@ void reconcile_timed(const char *what, const data_plane &plane, const appliance_
     const wanted_state wanted = make_wanted_state(view, found, &plane == &user_plane);
     if (!reconcile_kernel_state(plane, wanted, &indices, &error) || indices.size() != view.tunnels.size())
         die("reconcile: " + error);
-    printf("%s: %.0f ms\n", what, (now() - began) * 1e3);
+    printf("%s: %.0f ms\n", what, (seconds_now() - began) * 1e3);
     fflush(stdout);
 }
 int run_reconcile(char **words) {

@@ -1,10 +1,10 @@
 // wccpd with a stopwatch on its engine lock: for each second of the clock one line on standard output, with
-// how often the lock was held, for how long at the mean and at most, and for how much processor time at most;
-// then the same count and maxima for the main thread, which answers monitoring queries. What a hold takes
-// beyond its processor time is waiting, for a processor or another thread.
+// how often the lock was held, for how long on average and at most, and for how much processor time at most;
+// then the same count and maxima for the main thread, which answers monitoring queries. The rest of the time
+// of a hold is waiting, for a processor or another thread.
 //
-// The program's own pthread_mutex_lock and pthread_mutex_unlock stand in front of those of the C library. The
-// figures are guarded by the lock that they are about.
+// The program's own pthread_mutex_lock and pthread_mutex_unlock call those of the C library. The figures are
+// guarded by the measured lock itself.
 #include <algorithm>
 #include <cstdint>
 #include <cstdio>
@@ -23,7 +23,7 @@ namespace {
 struct hold {
     int64_t wall, cpu; // nanoseconds
 };
-hold now() {
+hold read_clocks() {
     const auto of = [](clockid_t clock) {
         timespec time = {};
         clock_gettime(clock, &time);
@@ -38,8 +38,8 @@ struct second {
 hold taken;
 second current;
 
-// The second that is over, when this hold is the first of the next one; else one without holds.
-second count(const hold &given) {
+// Returns the finished second if this hold is the first of the next one, otherwise one without holds.
+second count_hold(const hold &given) {
     second over = {};
     const int64_t wall = given.wall - taken.wall, cpu = given.cpu - taken.cpu;
     if (current.number != given.wall / 1'000'000'000) {
@@ -59,25 +59,25 @@ second count(const hold &given) {
 }
 
 using mutex_function = int (*)(pthread_mutex_t *);
-mutex_function behind(const char *name) {
+mutex_function find_real_function(const char *name) {
     return reinterpret_cast<mutex_function>(dlsym(RTLD_NEXT, name));
 }
 
 } // namespace
 
 extern "C" int pthread_mutex_lock(pthread_mutex_t *mutex) noexcept {
-    static const mutex_function real = behind("pthread_mutex_lock");
+    static const mutex_function real = find_real_function("pthread_mutex_lock");
     const int result = real(mutex);
     if (mutex == &wccp_g.lock)
-        taken = now();
+        taken = read_clocks();
     return result;
 }
 
 extern "C" int pthread_mutex_unlock(pthread_mutex_t *mutex) noexcept {
-    static const mutex_function real = behind("pthread_mutex_unlock");
+    static const mutex_function real = find_real_function("pthread_mutex_unlock");
     second over = {};
     if (mutex == &wccp_g.lock)
-        over = count(now());
+        over = count_hold(read_clocks());
     const int result = real(mutex);
     if (over.holds) {
         const cancel_off_guard uncancelled;

@@ -25,13 +25,13 @@ enum mode : uint8_t {
 };
 constexpr size_t MEMORY_PER_BYTE = 8, MEMORY_PER_MESSAGE = 1024;
 
-void require(bool condition, const char *what) {
+void require_true(bool condition, const char *what) {
     if (condition)
         return;
     fprintf(stderr, "not true: %s\n", what);
     abort();
 }
-#define REQUIRE(condition) require((condition), #condition)
+#define REQUIRE(condition) require_true((condition), #condition)
 
 lc_status read_wire(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
     return bn_request_msg_deserialize(buffer, offset, out);

@@ -1,5 +1,5 @@
-// Fuzzer for the frame reader of a session. The first byte of an input decides into how large reads the rest
-// is cut, and whether the session is open before; then the bytes go through a socket.
+// Fuzzer for the frame reader of a session. The first byte of an input determines the size of the reads and
+// whether the session is already open; the rest is sent through a socket.
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>

@@ -26,13 +26,13 @@ enum mode : uint8_t {
 constexpr size_t MAX_FRAMES = 300, MAX_FRAME_BYTES = 100000; // more than fits into one large packet
 using bytes = std::vector<uint8_t>;
 
-void require(bool condition, const char *what) {
+void require_true(bool condition, const char *what) {
     if (condition)
         return;
     fprintf(stderr, "not true: %s\n", what);
     abort();
 }
-#define REQUIRE(condition) require((condition), #condition)
+#define REQUIRE(condition) require_true((condition), #condition)
 
 struct exact_memory {
     explicit exact_memory(const bytes &content) : length(content.size()), memory(new uint8_t[length]) {
@@ -112,7 +112,7 @@ void advance_segment(bytes *gre) {
         tcp->sequence = to_be32(static_cast<uint32_t>(to_host(tcp->sequence) + gre->size() - at - headers));
 }
 
-// Packets in order, by flow, or by addresses if there are no ports. Only within these the order is kept.
+// Packets in order, by flow, or by addresses if there are no ports. The order is kept only within these.
 using flow_table = std::map<bytes, std::vector<bytes>>;
 void keep_packet(flow_table *table, bytes packet) {
     ip4_wire_header *ip = ip_of(packet.data());

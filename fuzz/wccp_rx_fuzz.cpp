@@ -34,13 +34,13 @@ enum mode : uint8_t {
 constexpr uint32_t ticks_after[8] = {0, 1, 2, 11, 17, 41, 61, 0};
 constexpr size_t DIGEST_AT = 16;
 
-void require(bool condition, const char *what) {
+void require_true(bool condition, const char *what) {
     if (condition)
         return;
     fprintf(stderr, "inconsistent records: %s\n", what);
     abort();
 }
-#define REQUIRE(condition) require((condition), #condition)
+#define REQUIRE(condition) require_true((condition), #condition)
 
 template <typename Entry>
 uint32_t list_length(Entry *const *head) {
