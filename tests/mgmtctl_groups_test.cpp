@@ -107,11 +107,11 @@ TEST(Groups, AsAWholeItIsOneCommitAsWell) {
     fake mgmtd;
     group_result result = mgmtd.run(NEW_ROUTERS);
     EXPECT_EQ(result.done, "recreated");
-    EXPECT_EQ(result.note, "wccpd takes a change of router only with the group as a whole");
+    EXPECT_EQ(result.note, "wccpd applies a change of router only by recreating the group");
     EXPECT_EQ(mgmtd.sent(0), "create /router/2/ipaddr=10.0.0.2;modify /weight=7;");
     result = mgmtd.run({"set", "51", "router", "none", "interface", "none"});
     EXPECT_EQ(mgmtd.sent(0), "remove /router/1=;reset /interface=;");
-    EXPECT_NE(result.note.find("router, interface only with the group as a whole; without an interface"),
+    EXPECT_NE(result.note.find("router, interface only by recreating the group; without an interface"),
               std::string::npos)
         << result.note;
     EXPECT_EQ(mgmtd.run({"restart", "51"}).done, "recreated");
@@ -204,7 +204,7 @@ TEST(Intercepts, ClausesInAnyOrderAreOneCommit) {
               "group 51 redirects udp, and an intercept of tcp gets none of that");
     EXPECT_EQ(intercept_command(mgmtd.link(), {"set", "51", "protocol", "udp"}).note, "");
     EXPECT_EQ(intercept_command(mgmtd.link(), {"add", "052", "all", "to", "1"}).note,
-              "there is no group 52; it takes no part until there is");
+              "there is no group 52; the intercept has no effect until the group exists");
     mgmtd.code = LC_NOT_FOUND;
     EXPECT_EQ(intercept_command(mgmtd.link(), {"delete", "52"}).exit, CTL_NOT_FOUND);
     mgmtd.code = LC_BAD_ARGUMENT;

@@ -438,7 +438,7 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
                              "  group 52 is unprotected: no bucket\n"
                              "  the router redirects this appliance's own traffic\n"
                              "  refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
-                             "  packets come in fragments, and the MSS of no flow has been clamped\n"})
+                             "  packets arrive in fragments, and the MSS of no flow has been clamped\n"})
         EXPECT_NE(screen.find(text), std::string::npos) << text << "\nnot in\n" << screen;
     EXPECT_EQ(screen.find(" \n"), std::string::npos) << screen;
     const json traffic = json::parse(draw_json(shown))["traffic"];
@@ -491,7 +491,7 @@ TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
               "all packets are returned: no tproxy\nthe kernel is not as wanted: wccp0: busy?\n"
               "the router redirects this appliance's own traffic\n"
               "refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
-              "packets come in fragments, and the MSS of no flow has been clamped\n");
+              "packets arrive in fragments, and the MSS of no flow has been clamped\n");
     const auto lists_all = [&] {
         return printed([&] { return tell_tunnels(options, link); }, CTL_OK).find("not listed") ==
                std::string::npos;

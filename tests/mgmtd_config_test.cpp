@@ -23,22 +23,22 @@ TEST(ConfigFile, EachBadLineIsReportedWithItsReason) {
     const struct {
         std::string content, error;
     } cases[] = {
-        {"[/qv/wccpd/wccp/srv_grp/config/256]\n", "1: \"256\" is no number between 0 and 255"},
+        {"[/qv/wccpd/wccp/srv_grp/config/256]\n", "1: \"256\" is not a number between 0 and 255"},
         {"[/qv/nobody]\n", "1: nothing can be set below /qv/nobody"},
         {"/x = 1\n[", "1: /x: there is no such node in the configuration\nF:2: a section is [/name]"},
-        {"weight = 1\n[/logging]\n", "1: \"weight\" is no name from the root, and it is in no section"},
+        {"weight = 1\n[/logging]\n", "1: \"weight\" is not a name from the root, and it is in no section"},
         {"weight\n", "2: expected [section] or name = value"},
         {"\n# c\nweight = 65536\n", "4: G/weight: \"65536\" is not between 0 and 65535"},
-        {"encap = GRE\n", "2: G/encap: \"GRE\" is none of gre|l2|either"},
-        {"protocol = htp\n",
-         "2: G/protocol: \"htp\" is no protocol; give a name such as tcp or udp, or a number from 1 to 255"},
+        {"encap = GRE\n", "2: G/encap: \"GRE\" is not one of gre|l2|either"},
+        {"protocol = htp\n", "2: G/protocol: \"htp\" is not a protocol; give a name such as tcp or udp, or a "
+                             "number from 1 to 255"},
         {"interface = a-name-too-long1\n",
          "2: G/interface: \"a-name-too-long1\" is longer than 15 characters"},
         {"weight = 1\nweight = 2\n", "3: G/weight: was given in line 2 already"},
         {"interface = \"eth0\n", "2: G/interface: the closing quote is missing"},
         {"password = 123456789\n", "2: G/password: the password is longer than 8 characters"},
         {"/logging/syslog/facility/system = 7\n",
-         "2: /logging/syslog/facility/system: \"7\" is no log facility (a multiple of 8 up to 184)"},
+         "2: /logging/syslog/facility/system: \"7\" is not a log facility (a multiple of 8 up to 184)"},
         {"/logging/syslog/process/a /log_level = debug\n",
          "2: /logging/syslog/process/a /log_level: the part \"a \" of the name begins or ends with a blank; "
          "write it without"},
@@ -80,16 +80,16 @@ TEST(Schema, ListsAreCheckedAndMadeCanonical) {
     } cases[] = {
         {"ports", " 443 80  8080-8090 8085-8100 81", "80-81 443 8080-8100", ""},
         {"ports", "all", "all", ""},
-        {"ports", "all 80", "", "is no list of ports"},
-        {"ports", "0", "", "is no list of ports"},
-        {"ports", "80-65536", "", "is no list of ports"},
+        {"ports", "all 80", "", "is not a list of ports"},
+        {"ports", "0", "", "is not a list of ports"},
+        {"ports", "80-65536", "", "is not a list of ports"},
         {"ports", "81-80", "", "is greater than its last"},
         {"ports", crowd, "", "more than 64 ranges"},
         {"ports", crowd + "1-1000", "1-1000", ""},
         {"bypass", "192.0.2.1 10.0.0.0/8 10.2.0.0/16 9.0.0.0/8 10.0.0.0/8",
          "9.0.0.0/8 10.0.0.0/8 192.0.2.1/32", ""},
         {"bypass", "255.255.255.255 10.0.0.0/8 0.0.0.0/0", "0.0.0.0/0", ""},
-        {"bypass", "10.0.0.0/33", "", "is no list of IPv4 prefixes"},
+        {"bypass", "10.0.0.0/33", "", "is not a list of IPv4 prefixes"},
         {"check_argument", "usr/bin/true", "", "does not begin with"},
         {"check_argument", "/opt/a check", "/opt/a check", ""},
     };
@@ -162,7 +162,7 @@ TEST_F(Mgmtd, TheFileIsReplacedOnlyIfNothingIsLost) {
     const node_name hidden = named("/logging/syslog/process/a /log_level");
     daemon.tree.set[hidden] = "debug";
     EXPECT_EQ(set({nine}), refused);
-    EXPECT_NE(message().find("would not be read the same"), std::string::npos) << message();
+    EXPECT_NE(message().find("would not be read as the same"), std::string::npos) << message();
     EXPECT_EQ(content(), held);
     daemon.tree.set.erase(hidden);
     // Neither a device, which a commit would replace, nor a pipe, which would block, is a configuration file.

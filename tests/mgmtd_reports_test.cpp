@@ -255,9 +255,9 @@ TEST_F(OutOfRouters, ADrainedGroupAnnouncesWeightZeroAndLeavesOnceItIsEmpty) {
     EXPECT_EQ(tick(LEFT_KEEP_MS - 1), strings{});
     EXPECT_EQ(tick(1), strings{weight + "=8>10"});
     EXPECT_NE(content().find("weight = 10"), std::string::npos);
-    const char *const bad[][3] = {{"group", "256", "group is no number between 0 and 255"},
+    const char *const bad[][3] = {{"group", "256", "group is not a number between 0 and 255"},
                                   {"group", "7", "There is no group 7"},
-                                  {"seconds", "86401", "seconds is no number between 0 and 86400"}};
+                                  {"seconds", "86401", "seconds is not a number between 0 and 86400"}};
     for (const auto &[field, number, refused] : bad) {
         EXPECT_EQ(begin(field, number), strings{});
         EXPECT_EQ(message(), refused);

@@ -338,7 +338,7 @@ TEST_F(Transport, TheSocketIsOursAlone) {
         now += LISTENER_CHECK_MS;
         pump();
         EXPECT_TRUE(std::count(lines.begin(), lines.end(),
-                               "/tmp/gcl-socks/uds-provider-mgmtd was removed, made again"))
+                               "/tmp/gcl-socks/uds-provider-mgmtd was removed and has been made again"))
             << command;
         lines.clear();
         raw_client client;

@@ -124,9 +124,9 @@ expect 0 "created ${G%51}52" set "${G%51}52/weight=1"
 expect 0 'jq:.changed == ["'"${G%51}52"'"] and .exit == 0' --json delete "${G%51}52"
 expect 4 '' delete "${G%51}52"
 expect 0 '' set $G/priority 100
-complains '*note: group 51: wccpd takes a change of priority only with the group as a whole*'
+complains '*note: group 51: wccpd applies a change of priority only by recreating the group*'
 expect 0 '' delete $G/router/1
-complains '*note: group 51: wccpd takes a change of router/1 only with the group as a whole*'
+complains '*note: group 51: wccpd applies a change of router/1 only by recreating the group*'
 expect 0 '' delete $G/mask_dst_ip
 expect 0 3840 get $G/mask_dst_ip
 
@@ -182,7 +182,7 @@ expect 0 'nothing to change' apply --check - <"$LAB/exported"
 sed 's/weight = .*//; $a [/qv/wccpd/wccp/policy_grp/config/5]' "$LAB/exported" >"$LAB/applied"
 expect 1 'add    /qv/wccpd/wccp/policy_grp/config/5 = 5' apply --check - <"$LAB/applied"
 expect 2 '' apply - <"$LAB/applied"
-complains '*there is nobody to ask: add --yes, or --check'
+complains '*cannot ask for confirmation: add --yes or --check'
 expect 2 'jq:.exit == 2 and (.error | startswith("standard input:1: "))' --json apply --check - <<<nonsense
 expect 0 'jq:.done and .changes[0].after == 5 and .confirm_minutes == 3' --json apply --yes --confirm 3 - <"$LAB/applied"
 expect 1 '' set $G/weight 8

@@ -129,7 +129,7 @@ expect 0 '.done == "added"' policy add 5 name web
 expect 0 '.done == "changed" and .state != null' group set 51 policy 5
 expect 0 '.groups[0].policy == 5' show
 expect 1 '.code == 14002 and (.error | test("51/policy_grp: policy group 5 is in use"))' policy delete 5
-expect 0 '.notes[0] | test("priority only with")' set $GROUP/51/priority 20
+expect 0 '.notes[0] | test("priority only by")' set $GROUP/51/priority 20
 lab_wait_log 5 a1 'WCCP config: set priority to 20' || fail "wccpd did not log the priority"
 expect 0 '.done == "recreated" and .commits == 1 and .running' group restart 51
 expect 0 '.done == "recreated" and .running' group set 51 policy none

@@ -337,27 +337,28 @@ int tell_checks(const ctl_options &options, const check_result &result) {
             all.push_back(reason_json(each));
         for (const auto &each : result.unchecked)
             unchecked.push_back({{"check", each.check}, {"why", each.why}});
-        put(json_line({{"attention", fix},
-                       {"reasons", all},
-                       {"unchecked", unchecked},
-                       {"fine", result.fine},
-                       {"exit", exit}}));
+        write_output(json_line({{"attention", fix},
+                                {"reasons", all},
+                                {"unchecked", unchecked},
+                                {"fine", result.fine},
+                                {"exit", exit}}));
         return exit;
     }
     for (const reason &each : result.findings)
-        put(each.code + (each.group < 0 ? "" : " (group " + std::to_string(each.group) + ")") + ": " +
-            each.cause + "\n    " + (each.attention ? "fix: " : "no fault: ") + each.next + "\n");
+        write_output(each.code + (each.group < 0 ? "" : " (group " + std::to_string(each.group) + ")") +
+                     ": " + each.cause + "\n    " + (each.attention ? "fix: " : "no fault: ") + each.next +
+                     "\n");
     std::map<std::string, std::string> unchecked; // the names of the checks, by the reason
     for (const auto &each : result.unchecked) {
         std::string &names = unchecked[each.why];
         names.append(names.empty() ? "" : ", ").append(each.check);
     }
     for (const auto &[why, names] : unchecked)
-        put(std::string("not checked: ").append(names).append(": ").append(why).append("\n"));
+        write_output(std::string("not checked: ").append(names).append(": ").append(why).append("\n"));
     std::string fine;
     for (const std::string &each : result.fine)
         fine += (fine.empty() ? "fine: " : ", ") + each;
-    put(fine + (fine.empty() ? "" : "\n") + (fix ? "" : "nothing to fix\n"));
+    write_output(fine + (fine.empty() ? "" : "\n") + (fix ? "" : "nothing to fix\n"));
     return exit;
 }
 

@@ -26,7 +26,7 @@ struct check_interface {
     long mtu = 0;
     std::optional<long> rp_filter, forwarding; // its own; empty: cannot be read
 };
-// A socket on UDP port 2048. Program and process are empty, and 0, where only root may see them.
+// A socket on UDP port 2048. Where only root may see them, the program is empty and the process 0.
 struct check_socket {
     std::string address; // 0.0.0.0 for a socket of IPv6 as well
     std::string program;
@@ -71,7 +71,7 @@ check_result judge_facts(const check_facts &facts);
 // The words of findings. Codes that wccpd has as well are in the table of reasons.h.
 const std::vector<reason_text> &check_texts();
 
-// Looks at the host (check_facts.cpp), and asks mgmtd for the groups.
+// Examines the host (check_facts.cpp), and queries mgmtd for the groups.
 check_facts gather_facts(const ctl_link &link);
 // Prints the result. 0: nothing to fix, 1: something.
 int tell_checks(const ctl_options &options, const check_result &result);

@@ -1,4 +1,4 @@
-// The facts that "mgmtctl check" looks at. Everything is only read; what cannot be read is noted.
+// The facts that "mgmtctl check" examines. Nothing is changed, and facts that cannot be read are noted.
 #include <arpa/inet.h>
 #include <dirent.h>
 #include <ifaddrs.h>

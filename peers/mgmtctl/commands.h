@@ -15,7 +15,7 @@ enum ctl_exit : int {
     CTL_NOT_FOUND = 4,    // no such node or group
     CTL_PARTLY = 5,       // no longer used: every command is one commit
     CTL_WOULD_CHANGE = 1, // apply --check: there is a difference; every failure is 2
-    CTL_STANDING = 6,     // alarms --check: an alarm is active
+    CTL_ALARM = 6,        // alarms --check: an alarm is active
     CTL_OUTPUT = 7,       // standard output could not be written completely
 };
 
@@ -39,7 +39,7 @@ int ctl_walk_nodes(const ctl_options &options, const std::string &name, ctl_walk
 int ctl_change_nodes(const ctl_options &options, const std::vector<std::string> &words, bool existing);
 int ctl_delete(const ctl_options &options, const std::vector<std::string> &names);
 int ctl_alarms(const ctl_options &options, bool check);
-// Prints nothing but completions, whatever fails: the shell calls it while somebody types.
+// Prints nothing but completions, even on failure: the shell calls it while somebody types.
 int ctl_complete(const std::string &word);
 
 // Groups in an operator's words (group_cli.cpp): "group add 51 interface eth0 router 10.0.0.1 weight 100".
@@ -58,7 +58,7 @@ int ctl_drain(const ctl_options &options, const std::vector<std::string> &words)
 struct ctl_apply_options {
     bool check = false;           // only report whether it would change anything
     bool yes = false;             // don't ask
-    bool merge = false;           // what the file doesn't name stays
+    bool merge = false;           // nodes that the file doesn't name stay
     uint32_t confirm_minutes = 0; // until it is undone, unless "mgmtctl confirm" follows; 0: it stays
 };
 constexpr uint32_t CTL_CONFIRM_MAX_MINUTES = 7 * 24 * 60;
@@ -93,5 +93,5 @@ struct ctl_notify_options {
     uint32_t limit_s = 30;                                    // for a command
 };
 int ctl_notify(const ctl_options &options, const std::string &word, const ctl_notify_options &how);
-// Events as they come (watch.cpp). `count` 0: until a signal ends the program.
+// Events as they arrive (watch.cpp). `count` 0: until a signal ends the program.
 int ctl_watch(const ctl_options &options, const std::vector<std::string> &names, uint64_t count);

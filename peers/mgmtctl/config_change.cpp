@@ -30,7 +30,7 @@ bool parse_json(const std::string &content, ctl_json *out, std::string *out_reas
     };
     *out = ctl_json::parse(content, look, false);
     if (out->is_discarded() || !out->is_object())
-        *out_reason = "is no JSON object of nodes and their values";
+        *out_reason = "is not a JSON object of nodes and their values";
     else if (!twice.empty())
         *out_reason = shown_text(twice) + ": is given twice";
     return out_reason->empty();
@@ -84,8 +84,8 @@ bool keep_hidden(node_tree *tree, const node_tree &present, std::string *out_rea
         const auto found = present.set.find(name);
         if (found == present.set.end() || found->second.empty()) {
             *out_reason = name.text() +
-                          ": the password is hidden, and there is none here that it could stand "
-                          "for; \"mgmtctl export --secrets\" writes it";
+                          ": the password is hidden, and there is none here that it could mean; "
+                          "\"mgmtctl export --secrets\" writes it";
             return false;
         }
         text = found->second;

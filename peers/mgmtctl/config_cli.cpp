@@ -46,7 +46,7 @@ bool get_config(connection *mgmtd, const std::string &name, const std::string &m
     if (config_parse(reply.bindings[0].value, name, out))
         return true;
     mgmtd->code = tell_failure(mgmtd->options,
-                               {CTL_REFUSED, "", "what mgmtd answers can't be read: " + out->errors, "", 0});
+                               {CTL_REFUSED, "", "mgmtd's answer can't be read: " + out->errors, "", 0});
     return false;
 }
 
@@ -57,7 +57,8 @@ bool get_present(connection *mgmtd, config_text *out, uint32_t *out_revision) {
 bool get_commit(connection *mgmtd, uint32_t number, config_text *out) {
     uint32_t ignored = 0;
     return get_config(mgmtd, NODE_COMMITS "/" + std::to_string(number) + "/text",
-                      "commit " + std::to_string(number) + " is not kept; \"mgmtctl history\" lists what is",
+                      "commit " + std::to_string(number) +
+                          " is not kept; \"mgmtctl history\" lists those that are",
                       out, &ignored);
 }
 
@@ -87,7 +88,7 @@ ctl_json json_changes(const std::vector<node_change> &changes, bool secrets) {
 
 void put_changes(const ctl_options &options, const std::vector<node_change> &changes) {
     for (const node_change &change : changes)
-        put(text_change(change, options.secrets) + "\n");
+        write_output(text_change(change, options.secrets) + "\n");
 }
 
 // Prints the changes for a person.
@@ -104,21 +105,22 @@ int tell_plan(const ctl_options &options, const plan &made, uint32_t commit, boo
               uint32_t confirm_minutes, int code) {
     const bool waits = done && confirm_minutes != 0;
     if (options.json) {
-        put(json_line({{"changes", json_changes(made.changes, options.secrets)},
-                       {"done", done},
-                       {"commit", commit},
-                       {"confirm_minutes", waits ? ctl_json(confirm_minutes) : ctl_json(nullptr)},
-                       {"notes", made.notes.notes},
-                       {"exit", code}}));
+        write_output(json_line({{"changes", json_changes(made.changes, options.secrets)},
+                                {"done", done},
+                                {"commit", commit},
+                                {"confirm_minutes", waits ? ctl_json(confirm_minutes) : ctl_json(nullptr)},
+                                {"notes", made.notes.notes},
+                                {"exit", code}}));
         return code;
     }
     if (made.changes.empty())
-        put("nothing to change\n");
+        write_output("nothing to change\n");
     else if (done)
-        put("commit " + std::to_string(commit) + "\n");
+        write_output("commit " + std::to_string(commit) + "\n");
     if (waits)
-        put("it is undone in " + std::to_string(confirm_minutes) +
-            (confirm_minutes == 1 ? " minute" : " minutes") + ", unless \"mgmtctl confirm\" follows\n");
+        write_output("it is undone in " + std::to_string(confirm_minutes) +
+                     (confirm_minutes == 1 ? " minute" : " minutes") +
+                     ", unless \"mgmtctl confirm\" follows\n");
     return code;
 }
 
@@ -185,7 +187,8 @@ int apply_plan(connection *mgmtd, const plan &made, const ctl_apply_options &how
 int ctl_apply(const ctl_options &options, const std::string &file, const ctl_apply_options &how) {
     std::string content, errors;
     if (!how.yes && !how.check && (options.json || file == "-" || !isatty(STDIN_FILENO)))
-        return tell_failure(options, {CTL_USAGE, "", "there is nobody to ask: add --yes, or --check", "", 0});
+        return tell_failure(options,
+                            {CTL_USAGE, "", "cannot ask for confirmation: add --yes or --check", "", 0});
     if (!read_file(file, &content, &errors))
         return tell_failure(options, {CTL_USAGE, "", file + ": " + errors, "", 0});
     connection mgmtd(options);
@@ -211,8 +214,8 @@ int ctl_confirm(const ctl_options &options) {
         return mgmtd.lost();
     if (reply.code != 0)
         return tell_failure(options, {exit_of(reply.code), "", reply.message, "", reply.code});
-    put(options.json ? json_line({{"confirmed", reply.message}, {"exit", 0}})
-                     : reply.message + " confirmed\n");
+    write_output(options.json ? json_line({{"confirmed", reply.message}, {"exit", 0}})
+                              : reply.message + " confirmed\n");
     return CTL_OK;
 }
 
@@ -222,10 +225,10 @@ int ctl_export(const ctl_options &options) {
     uint32_t revision = 0;
     if (!get_present(&mgmtd, &present, &revision))
         return mgmtd.code;
-    put(options.json ? export_json(present.tree, options.secrets)
-                               .dump(2, ' ', true, ctl_json::error_handler_t::replace) +
-                           "\n"
-                     : export_text(present, options.secrets));
+    write_output(options.json ? export_json(present.tree, options.secrets)
+                                        .dump(2, ' ', true, ctl_json::error_handler_t::replace) +
+                                    "\n"
+                              : export_text(present, options.secrets));
     return CTL_OK;
 }
 
@@ -326,10 +329,10 @@ int ctl_history(const ctl_options &options) {
     for (const kept_commit &commit : commits) {
         all.push_back(json_commit(commit));
         if (!options.json)
-            put(text_commit(commit));
+            write_output(text_commit(commit));
     }
     if (options.json)
-        put(json_line(all));
+        write_output(json_line(all));
     return CTL_OK;
 }
 
@@ -359,7 +362,7 @@ int ctl_diff(const ctl_options &options, uint32_t from, uint32_t to) {
         return mgmtd.code;
     const std::vector<node_change> changes = config_changes(before.tree, after.tree);
     if (options.json)
-        put(json_line(
+        write_output(json_line(
             {{"from", from}, {"to", revision}, {"changes", json_changes(changes, options.secrets)}}));
     else
         put_changes(options, changes);

@@ -24,7 +24,7 @@ struct drain_wish {
     bool wait = false;
 };
 
-// Returns "", or what is wrong.
+// Returns "", or the error.
 std::string parse_wish(const std::vector<std::string> &words, drain_wish *out) {
     static const char *const USAGE = "drain [GROUP] [for SECONDS] [wait], drain cancel [GROUP], drain show";
     size_t at = 0;
@@ -63,7 +63,7 @@ bool ask_drains(const ctl_link &link, std::vector<traffic_drain> *out, ctl_failu
 }
 
 void put_drain(const traffic_drain &drain) {
-    put("group " + std::to_string(drain.group) + ": " + drain_text(drain, time(nullptr)) + "\n");
+    write_output("group " + std::to_string(drain.group) + ": " + drain_text(drain, time(nullptr)) + "\n");
 }
 
 // Prints the drains that have changed.
@@ -86,14 +86,14 @@ int tell_end(const ctl_options &options, const std::vector<traffic_drain> &drain
     const bool over =
         std::any_of(drains.begin(), drains.end(), [](const auto &each) { return each.state != "drained"; });
     if (options.json)
-        put(json_line({{"drains", drains_json(drains)},
-                       {"done", cancelled ? "cancelled"
-                                : over    ? "over"
-                                          : "drained"}}));
+        write_output(json_line({{"drains", drains_json(drains)},
+                                {"done", cancelled ? "cancelled"
+                                         : over    ? "over"
+                                                   : "drained"}}));
     else if (cancelled)
-        put("cancelled\n");
+        write_output("cancelled\n");
     else if (expected == 0)
-        put("no group is up\n");
+        write_output("no group is up\n");
     return cancelled || over ? CTL_REFUSED : CTL_OK;
 }
 
@@ -126,7 +126,7 @@ int tell_drains(const ctl_options &options, const ctl_link &link, const std::str
         return tell_failure(options, failure);
     leave_out_others(group, &drains);
     if (options.json)
-        put(json_line({{"drains", drains_json(drains)}}));
+        write_output(json_line({{"drains", drains_json(drains)}}));
     else
         for (const traffic_drain &drain : drains)
             put_drain(drain);
@@ -156,7 +156,7 @@ int run_drain(const ctl_options &options, const ctl_link &link, const std::vecto
     if (wish.wait)
         return wait_for_end(options, link, wish.group);
     if (wish.verb == drain_wish::cancel && !options.json) {
-        put("cancelled\n");
+        write_output("cancelled\n");
         return CTL_OK;
     }
     return tell_drains(options, link, wish.group);

@@ -36,16 +36,16 @@ void print_reasons(const snapshot &shown, const std::vector<reason> &reasons) {
     for (const snapshot_group &group : shown.groups)
         ids.push_back(group.id);
     for (const int id : ids) {
-        put(heading_of(shown, id));
+        write_output(heading_of(shown, id));
         if (!main_reason(reasons, id))
-            put(id < 0 || shown.wccpd == wccpd_condition::running ? "  nothing needs attention\n"
-                                                                  : "  unknown without wccpd\n");
+            write_output(id < 0 || shown.wccpd == wccpd_condition::running ? "  nothing needs attention\n"
+                                                                           : "  unknown without wccpd\n");
         for (const reason &each : reasons)
             if (each.group == id)
-                put(reason_words(each));
+                write_output(reason_words(each));
     }
     if (ids.empty())
-        put("no group is configured\n");
+        write_output("no group is configured\n");
 }
 } // namespace
 
@@ -63,7 +63,7 @@ int tell_reasons(const ctl_options &options, const snapshot &shown, int group) {
         ctl_json all = ctl_json::array();
         for (const reason &each : reasons)
             all.push_back(reason_json(each));
-        put(json_line({{"attention", attention}, {"reasons", all}, {"exit", exit}}));
+        write_output(json_line({{"attention", attention}, {"reasons", all}, {"exit", exit}}));
     } else {
         print_reasons(shown, reasons);
     }
@@ -82,6 +82,6 @@ int ctl_list_reasons(const ctl_options &options) {
     for (const reason_text &row : reason_texts())
         all.push_back(
             {{"reason", row.code}, {"attention", row.attention}, {"cause", row.cause}, {"next", row.next}});
-    put(options.json ? json_line(all) : reason_table_markdown());
+    write_output(options.json ? json_line(all) : reason_table_markdown());
     return EXPLAIN_FINE;
 }

@@ -53,15 +53,15 @@ std::string result_text(const group_result &result) {
     else if (result.runs)
         text += "; state " + result.state + (result.designated ? ", designated" : "");
     else if (!result.wccpd.empty() && result.done != "deleted")
-        text += "; wccpd does not have it, its log tells why";
+        text += "; wccpd does not have it; its log has the reason";
     return text;
 }
 
 int report_result(const ctl_options &options, const group_result &result) {
     if (options.json)
-        put(json_line(result_json(result)));
+        write_output(json_line(result_json(result)));
     else if (result.exit == CTL_OK)
-        put(result_text(result) + "\n");
+        write_output(result_text(result) + "\n");
     else
         return tell_failure(
             options, {result.exit, result.number < 0 ? "" : result.kind + " " + std::to_string(result.number),
@@ -74,8 +74,9 @@ int list_words(const ctl_options &options) {
     for (const group_word &word : group_words()) {
         const char *fallback = group_word_fallback(word);
         if (!options.json)
-            put(word.word + std::string(17 - std::string(word.word).size(), ' ') + group_word_values(word) +
-                (fallback && *fallback ? std::string("; default ") + fallback : "") + "\n");
+            write_output(word.word + std::string(17 - std::string(word.word).size(), ' ') +
+                         group_word_values(word) +
+                         (fallback && *fallback ? std::string("; default ") + fallback : "") + "\n");
         all.push_back({{"word", word.word},
                        {"node", word.node},
                        {"values", group_word_values(word)},
@@ -83,7 +84,7 @@ int list_words(const ctl_options &options) {
                        {"recreates", word.change == group_change::as_whole}});
     }
     if (options.json)
-        put(json_line(all));
+        write_output(json_line(all));
     return CTL_OK;
 }
 
@@ -106,11 +107,11 @@ void tell_list(const ctl_options &options, const std::vector<listed_group> &grou
             one[word ? word->word : name] = hidden ? HIDDEN : value;
         }
         if (!options.json)
-            put(line + "\n");
+            write_output(line + "\n");
         all.push_back(one);
     }
     if (options.json)
-        put(json_line(all));
+        write_output(json_line(all));
 }
 
 int run_words(const ctl_options &options, const std::vector<std::string> &words, const char *above,

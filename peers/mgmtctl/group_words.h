@@ -33,7 +33,7 @@ struct group_wish {
     std::map<std::string, std::optional<std::string>> values; // by node; none: back to the default
     std::optional<std::vector<std::string>> routers;          // the whole new list
 };
-// Reads WORD VALUE [WORD VALUE ...] from the third word on. Returns "", or what is wrong.
+// Reads WORD VALUE [WORD VALUE ...] from the third word on. Returns "", or the error.
 std::string parse_group_wish(const std::vector<std::string> &words, group_wish *out);
 
 // The error for a word that is not one of these.

@@ -157,8 +157,8 @@ void wait_for_wccpd(const ctl_link &link, bool wanted, group_result *inout) {
 // mgmtd accepts a group without these, but such a group does nothing.
 std::string missing_part_note(const group_nodes &nodes) {
     if (!nodes.contains("interface"))
-        return "without an interface it takes no part";
-    return group_routers(nodes).empty() ? "without a router it takes no part" : "";
+        return "without an interface it is inactive";
+    return group_routers(nodes).empty() ? "without a router it is inactive" : "";
 }
 
 void add_group(const ctl_link &link, const std::string &root, const group_wish &wish, group_result *inout) {
@@ -241,10 +241,10 @@ void change_group(const ctl_link &link, const std::string &root, const group_wis
         const char *fallback = group_word_fallback(*word);
         const auto otherwise = fallback ? std::optional<std::string>(fallback) : std::nullopt;
         const auto old = before.find(node);
-        const auto stood = old != before.end() ? std::optional(old->second) : otherwise;
+        const auto present_value = old != before.end() ? std::optional(old->second) : otherwise;
         const std::string name = root + "/" + node;
         const auto to = value ? std::optional(kept_value(name, *value)) : otherwise;
-        if (to == stood)
+        if (to == present_value)
             continue;
         if (value)
             after[node] = *to;
@@ -267,7 +267,7 @@ void change_group(const ctl_link &link, const std::string &root, const group_wis
     } else {
         const std::string lack = missing_part_note(after);
         inout->done = "recreated";
-        inout->note = "wccpd takes a change of " + as_whole + " only with the group as a whole" +
+        inout->note = "wccpd applies a change of " + as_whole + " only by recreating the group" +
                       (lack.empty() ? "" : "; " + lack);
     }
     wait_for_wccpd(link, true, inout);

@@ -26,7 +26,7 @@ html_markup make_badge(style how, const std::string &words);
 html_markup symbol_of(style how);
 html_markup unknown_badge();
 html_markup known_or_unknown(const std::string &text);
-std::string separate_by_dots(std::string words); // separates by dots what the screen separates by two blanks
+std::string separate_by_dots(std::string words); // with dots where the screen has two blanks
 
 // Begins a table with its column heads. On a narrow screen a row is a block, in which each cell after the
 // first is preceded by its head.

@@ -105,9 +105,9 @@ std::vector<ctl_change_item> change_items(const std::string &root, const interce
         const schema_row *row = find_schema_row(parsed_name(name));
         const auto old = before.find(node);
         const auto fallback = row && row->fallback ? std::optional<std::string>(row->fallback) : std::nullopt;
-        const auto stood = old != before.end() ? std::optional(old->second) : fallback;
+        const auto present_value = old != before.end() ? std::optional(old->second) : fallback;
         const auto wanted = value ? std::optional(kept_value(name, *value)) : fallback;
-        if (wanted == stood)
+        if (wanted == present_value)
             continue;
         if (value)
             items.push_back({ctl_change::create, {name, "", *wanted}});
@@ -139,7 +139,7 @@ std::string misfit_note(const ctl_link &link, const std::string &number, const s
     if (!read_nodes(link, std::string(NODE_GROUP_CONFIG "/") + number, &group, &unused))
         return "";
     if (group.empty())
-        return "there is no group " + number + "; it takes no part until there is";
+        return "there is no group " + number + "; the intercept has no effect until the group exists";
     const std::string redirected = group.contains("protocol") ? group["protocol"] : "tcp";
     if (protocol_number(redirected) == protocol_number(protocol))
         return "";
@@ -201,8 +201,9 @@ traffic_result intercept_command(const ctl_link &link, const std::vector<std::st
         return with_failure(result, CTL_USAGE, wrong);
     if (verb == "add" && (!wish.contains("ports") || !wish.contains("to")))
         return with_failure(result, CTL_USAGE,
-                            wish.contains("ports") ? "\"to\" is missing: the port that the proxy listens on"
-                                                   : "\"port\" or \"all\" is missing: what the proxy wants");
+                            wish.contains("ports")
+                                ? "\"to\" is missing: the port that the proxy listens on"
+                                : "\"port\" or \"all\" is missing: the ports that the proxy wants");
     const std::string root = NODE_INTERCEPT_CONFIG "/" + result.subject;
     if (verb == "delete")
         delete_root(link, root, "deleted", "there is no intercept for group " + result.subject, &result);
@@ -277,7 +278,7 @@ traffic_result tunnel_command(const ctl_link &link, const std::vector<std::strin
     result.subject = address;
     const std::string root = instance_name(NODE_ACCEPT_CONFIG, address);
     if (verb == "refuse") {
-        delete_root(link, root, "refused", "is not accepted beside the routers", &result);
+        delete_root(link, root, "refused", "is not an accepted source", &result);
         return result;
     }
     node_texts before;

@@ -97,8 +97,7 @@ int usage_error(const CLI::App &app, const std::vector<std::string> &arguments, 
 // --- Commands
 
 struct command_line {
-    CLI::App app{"Asks mgmtd for the state of the appliance, changes its configuration, watches it.",
-                 "mgmtctl"};
+    CLI::App app{"Shows the state of the appliance, changes its configuration and watches it.", "mgmtctl"};
     ctl_options options;
     double seconds = 10; // of --timeout
     std::function<int()> run;
@@ -143,13 +142,13 @@ void add_node_commands(command_line *line) {
     });
     command->add_option("NAME", line->name)->capture_default_str();
     CLI::Option *only_children =
-        command->add_flag("--children", line->children, "what is directly below it only");
+        command->add_flag("--children", line->children, "only the nodes directly below it");
     command->add_flag("--leaves", line->leaves, "only nodes with nothing below them")
         ->excludes(only_children);
     command = add_command(line, "set", "set nodes: one commit",
                           [line] { return ctl_change_nodes(line->options, line->words, line->existing); });
     command->add_option("NAME=VALUE", line->words, "or NAME VALUE")->required();
-    command->add_flag("--existing", line->existing, "make no new group, policy group or router");
+    command->add_flag("--existing", line->existing, "don't create a group, policy group or router");
     add_command(line, "delete", "delete nodes with all below them: one commit",
                 [line] { return ctl_delete(line->options, line->words); })
         ->add_option("NAME", line->words)
@@ -157,13 +156,14 @@ void add_node_commands(command_line *line) {
 }
 
 void add_watch_commands(command_line *line) {
-    CLI::App *command = add_command(line, "watch", "changes, alarms, roles and processes, as they come",
+    CLI::App *command = add_command(line, "watch", "changes, alarms, roles and processes, as they happen",
                                     [line] { return ctl_watch(line->options, line->words, line->count); });
-    command->add_option("NAME", line->words, "changes of this and below it only; * is one part of a name");
-    command->add_option("--count", line->count, "end after so many events");
-    add_command(line, "alarms", "the alarms that are active", [line] {
+    command->add_option("NAME", line->words,
+                        "only changes of this node and those below it; * is one part of a name");
+    command->add_option("--count", line->count, "end after this many events");
+    add_command(line, "alarms", "the active alarms", [line] {
         return ctl_alarms(line->options, line->check);
-    })->add_flag("--check", line->check, "exit with 6 when there are any");
+    })->add_flag("--check", line->check, "exit with 6 if there are any");
 }
 
 void add_group_commands(command_line *line) {
@@ -179,13 +179,13 @@ void add_traffic_commands(command_line *line) {
     add_command(line, "intercept", "redirected packets to a proxy: add, set, delete, show, words", [line] {
         return ctl_intercept(line->options, line->words);
     })->add_option("WORD", line->words);
-    add_command(line, "bypass", "clients and servers that are left alone: add, delete, show", [line] {
+    add_command(line, "bypass", "clients and servers whose packets are returned: add, delete, show", [line] {
         return ctl_bypass(line->options, line->words);
     })->add_option("WORD", line->words);
-    add_command(line, "tunnel", "tunnels and who may send into them: accept, refuse, show", [line] {
+    add_command(line, "tunnel", "tunnels and their accepted sources: accept, refuse, show", [line] {
         return ctl_tunnel(line->options, line->words);
     })->add_option("WORD", line->words);
-    add_command(line, "protection", "flows whose appliance has changed: [time SECONDS]", [line] {
+    add_command(line, "protection", "flows whose buckets have moved: [time SECONDS]", [line] {
         return ctl_protection(line->options, line->words);
     })->add_option("WORD", line->words);
 }
@@ -196,28 +196,29 @@ void add_config_commands(command_line *line) {
                                   [line] { return ctl_apply(line->options, line->name, line->apply); });
     apply
         ->add_option("FILE", line->name,
-                     "a configuration, as mgmtd's file has it or as JSON; - for standard input")
+                     "a configuration, in the format of mgmtd's file or as JSON; - for standard input")
         ->required();
-    CLI::Option *check = apply->add_flag(
-        "--check", line->apply.check, "change nothing; exit with 1 when it would, 0 when not, 2 for errors");
+    CLI::Option *check =
+        apply->add_flag("--check", line->apply.check,
+                        "change nothing; exit with 1 if something would change, 0 if not, 2 for errors");
     apply->add_flag("--yes", line->apply.yes, "don't ask");
-    apply->add_flag("--merge", line->apply.merge, "what FILE doesn't name stays as it is");
+    apply->add_flag("--merge", line->apply.merge, "keep the nodes that FILE doesn't name");
     apply
         ->add_option("--confirm", line->apply.confirm_minutes,
-                     "undo it after so many minutes, unless \"mgmtctl confirm\" follows")
+                     "undo it after this many minutes, unless \"mgmtctl confirm\" follows")
         ->check(CLI::Range(1u, CTL_CONFIRM_MAX_MINUTES))
         ->excludes(check);
-    add_command(line, "confirm", "keep what was applied with --confirm",
+    add_command(line, "confirm", "keep the commit that was applied with --confirm",
                 [line] { return ctl_confirm(line->options); });
-    add_command(line, "export", "the configuration as apply reads it",
+    add_command(line, "export", "the configuration in the format of apply",
                 [line] { return ctl_export(line->options); });
     add_command(line, "history", "the last commits", [line] { return ctl_history(line->options); });
     CLI::App *diff = add_command(line, "diff", "what the last commit changed, or all since commit FROM",
                                  [line] { return ctl_diff(line->options, line->from, line->to); });
     diff->add_option("FROM", line->from, "the number of a commit")->check(commits);
-    diff->add_option("TO", line->to, "the number of another, instead of the configuration as it is")
+    diff->add_option("TO", line->to, "the number of another one; default: the present configuration")
         ->check(commits);
-    add_command(line, "rollback", "go back to a commit: a commit of its own",
+    add_command(line, "rollback", "return to a commit, by a new commit",
                 [line] { return ctl_rollback(line->options, line->from); })
         ->add_option("COMMIT", line->from, "its number")
         ->check(commits)
@@ -243,17 +244,17 @@ void add_show_command(command_line *line) {
     ctl_options *options = &line->options;
     CLI::App *command = add_command(line, "show", "the whole appliance in one screen",
                                     [options] { return ctl_show(*options); });
-    CLI::Option *stay = command->add_flag("--watch", options->watch, "stay, and follow what changes");
+    CLI::Option *stay = command->add_flag("--watch", options->watch, "keep running, and follow changes");
     command->add_option("--html", options->html, "write it as a page to FILE; - is standard output")
         ->type_name("FILE")
         ->check([](const std::string &file) { return file.empty() ? "the name of a file is empty" : ""; })
         ->excludes(stay)
         ->excludes(line->app.get_option("--json"));
-    command->add_option("--below", options->below, "leave so many rows at the top of the terminal alone")
+    command->add_option("--below", options->below, "leave this many rows at the top of the terminal alone")
         ->check(CLI::Range(0, 1000))
         ->needs(stay);
     command->add_flag_callback(
-        "--colour", [options] { options->colour = 1; }, "in colour, whatever the output is");
+        "--colour", [options] { options->colour = 1; }, "in colour, also if the output is not a terminal");
     command->add_flag_callback(
         "--no-colour", [options] { options->colour = 0; }, "without colour");
 }
@@ -262,12 +263,12 @@ void add_explain_command(command_line *line) {
     CLI::App *command = add_command(line, "explain", "why a group does not work, and what to do", [line] {
         return line->list ? ctl_list_reasons(line->options) : ctl_explain(line->options, line->group);
     });
-    command->add_option("GROUP", line->group, "this group alone")->check(CLI::Range(0, 255));
-    command->add_flag("--list", line->list, "every reason that there can be, as a table");
+    command->add_option("GROUP", line->group, "only this group")->check(CLI::Range(0, 255));
+    command->add_flag("--list", line->list, "all possible reasons, as a table");
 }
 
 void add_check_command(command_line *line) {
-    add_command(line, "check", "what on this host is in the way, and how to fix it",
+    add_command(line, "check", "problems of this host, and how to fix them",
                 [line] { return ctl_check(line->options); });
 }
 
@@ -283,10 +284,11 @@ void add_notify_command(command_line *line) {
         add_command(line, "notify", "commands at changes of roles, alarms and proxies: run, list",
                     [line] { return ctl_notify(line->options, line->name, line->notify); });
     command->add_option("WORD", line->name)->required();
-    command->add_option("--directory", line->notify.directory, "of the commands")->capture_default_str();
-    command->add_option("--state", line->notify.state_file, "the file of the states that were reported")
+    command->add_option("--directory", line->notify.directory, "directory of the commands")
         ->capture_default_str();
-    command->add_option("--user", line->notify.user, "whose rights the commands have, when root starts it");
+    command->add_option("--state", line->notify.state_file, "file of the states that were reported")
+        ->capture_default_str();
+    command->add_option("--user", line->notify.user, "user to run as, if root starts it");
     command->add_option("--limit", line->notify.limit_s, "seconds that a command may take")
         ->check(CLI::Range(1u, 3600u))
         ->capture_default_str();

@@ -168,11 +168,11 @@ void add_node_samples(const gathering &work, const std::vector<ctl_binding> &bin
         node_name name = parsed_name(binding.name);
         std::string value;
         for (size_t i = 0; i < std::size(rows); i++)
-            if (matches(patterns[i], name) && rows[i].value(binding.value, &value))
+            if (matches_pattern(patterns[i], name) && rows[i].value(binding.value, &value))
                 work.add(rows[i].family, labels_of(metric_families[rows[i].family], patterns[i], name),
                          value);
         for (size_t i = 0; i < std::size(way_rows); i++) {
-            if (!matches(way_patterns[i], name) || !is_count(binding.value))
+            if (!matches_pattern(way_patterns[i], name) || !is_count(binding.value))
                 continue;
             std::string *way = &name.parts.back();
             const bool bytes = way_rows[i].bytes != 0 && way->ends_with("_bytes");

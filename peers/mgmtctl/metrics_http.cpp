@@ -39,11 +39,11 @@ int answer_request(const char *status, const char *type, const std::vector<std::
     size_t length = 0;
     for (const std::string &piece : body)
         length += piece.size();
-    put("HTTP/1.1 " + std::string(status) + "\r\nContent-Type: " + type +
-        "\r\nContent-Length: " + std::to_string(length) + "\r\nConnection: close\r\n\r\n");
+    write_output("HTTP/1.1 " + std::string(status) + "\r\nContent-Type: " + type +
+                 "\r\nContent-Length: " + std::to_string(length) + "\r\nConnection: close\r\n\r\n");
     for (const std::string &piece : body)
         if (with_body)
-            put(piece);
+            write_output(piece);
     return code;
 }
 
@@ -72,7 +72,7 @@ int serve_metrics_request(const ctl_link &link) {
     const metric_format format = request.find("application/openmetrics-text") != std::string::npos
                                      ? metric_format::openmetrics
                                      : metric_format::text;
-    // A mgmtd that does not answer is what the samples say then.
+    // If mgmtd does not answer, the samples report that.
     metric_lines samples;
     (void)gather_metrics(make_metric_source(link), &samples);
     return answer_request("200 OK", metrics_content_type(format), metrics_text(std::move(samples), format),
@@ -87,6 +87,6 @@ int ctl_metrics(const ctl_options &options, bool text, bool http) {
     const bool answered = gather_metrics(make_metric_source(link), &samples);
     for (const std::string &piece :
          metrics_text(std::move(samples), text ? metric_format::text : metric_format::openmetrics))
-        put(piece);
+        write_output(piece);
     return answered ? CTL_OK : CTL_UNREACHABLE;
 }

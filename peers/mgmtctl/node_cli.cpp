@@ -36,8 +36,8 @@ int ctl_get(const ctl_options &options, const std::vector<std::string> &names) {
             const ctl_binding &binding = reply.bindings[0];
             nodes.push_back(json_node(binding, options.secrets));
             if (!options.json)
-                put(names.size() == 1 ? shown_value(binding, options.secrets) + "\n"
-                                      : text_node(binding, options.secrets));
+                write_output(names.size() == 1 ? shown_value(binding, options.secrets) + "\n"
+                                               : text_node(binding, options.secrets));
             continue;
         }
         const ctl_failure failure =
@@ -49,7 +49,7 @@ int ctl_get(const ctl_options &options, const std::vector<std::string> &names) {
         code = code == CTL_OK ? failure.exit : code;
     }
     if (options.json)
-        put(json_line(nodes));
+        write_output(json_line(nodes));
     return code;
 }
 
@@ -82,10 +82,10 @@ int ctl_walk_nodes(const ctl_options &options, const std::string &name, ctl_walk
         if (options.json)
             nodes.push_back(json_node(binding, options.secrets));
         else
-            put(text_node(binding, options.secrets));
+            write_output(text_node(binding, options.secrets));
     }
     if (options.json)
-        put(json_line(nodes));
+        write_output(json_line(nodes));
     return CTL_OK;
 }
 
@@ -121,7 +121,7 @@ int commit_change(const ctl_options &options, const std::vector<ctl_change_item>
     const change_notes changes = notes_of(items, before);
     if (!options.json) {
         for (const std::string &root : changes.created)
-            put("created " + root + "\n");
+            write_output("created " + root + "\n");
         for (const std::string &note : changes.notes)
             fprintf(stderr, "mgmtctl: note: %s\n", note.c_str());
         return CTL_OK;
@@ -129,7 +129,7 @@ int commit_change(const ctl_options &options, const std::vector<ctl_change_item>
     ctl_json changed = ctl_json::array();
     for (const ctl_change_item &item : items)
         changed.push_back(item.binding.name);
-    put(json_line(
+    write_output(json_line(
         {{"changed", changed}, {"created", changes.created}, {"notes", changes.notes}, {"exit", 0}}));
     return CTL_OK;
 }
@@ -202,17 +202,17 @@ int ctl_alarms(const ctl_options &options, bool check) {
         return mgmtd.lost();
     if (reply.code != 0)
         return tell_failure(options, {exit_of(reply.code), "", reply.message, "", reply.code});
-    std::vector<ctl_alarm> standing = alarms_of(reply.bindings);
+    std::vector<ctl_alarm> active_alarms = alarms_of(reply.bindings);
     bool known = false;
-    if (!explain_alarms(&mgmtd, &standing, &known))
+    if (!explain_alarms(&mgmtd, &active_alarms, &known))
         return mgmtd.lost();
-    put(options.json ? json_line(json_alarms(standing)) : text_alarms(standing));
+    write_output(options.json ? json_line(json_alarms(active_alarms)) : text_alarms(active_alarms));
     if (!known)
         return CTL_UNREACHABLE;
-    return check && !standing.empty() ? CTL_STANDING : CTL_OK;
+    return check && !active_alarms.empty() ? CTL_ALARM : CTL_OK;
 }
 
-// Prints nothing but completions, whatever fails: the shell calls it while somebody types.
+// Prints nothing but completions, even on failure: the shell calls it while somebody types.
 int ctl_complete(const std::string &word) {
     std::string reason;
     const ctl_held_session session(ctl_open(1000, &reason));
@@ -220,6 +220,6 @@ int ctl_complete(const std::string &word) {
         return session && ctl_query(session.get(), walk, name, out, &reason);
     };
     for (const std::string &candidate : completions(ask, word))
-        put(candidate + "\n");
+        write_output(candidate + "\n");
     return CTL_OK;
 }

@@ -1,4 +1,4 @@
-// Names as a person types them: their completion, their correction, and what a change of the node means.
+// Names as a person types them: their completion, their correction, and the effect of a change of the node.
 //
 // The schema lists the names that can exist, without mgmtd. mgmtd is queried only where a part of a name can
 // be chosen freely (a group's number, a file). The upper parts therefore complete at once, and completion
@@ -64,7 +64,7 @@ std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above)
             continue;
         const std::string next = pattern.parts[depth];
         pattern.parts.resize(depth);
-        if (!matches(pattern, above))
+        if (!matches_pattern(pattern, above))
             continue;
         if (next == "*")
             choice = true;
@@ -226,10 +226,10 @@ bool add_appliances(const ctl_ask &ask, const std::string &root_text, std::vecto
     list.parts.back() = "appliance";
     std::vector<ctl_binding> counted;
     for (const ctl_binding &binding : *inout)
-        if (matches(counts, parsed_name(binding.name)))
+        if (matches_pattern(counts, parsed_name(binding.name)))
             counted.push_back(binding);
     // A walk that begins at the list itself does not contain the count.
-    if (matches(list, root)) {
+    if (matches_pattern(list, root)) {
         node_name count = root;
         count.parts.back() = counts.parts.back();
         ctl_reply reply;
@@ -333,14 +333,14 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
         if (root.empty())
             continue;
         const bool removed = item.change == ctl_change::remove || item.change == ctl_change::reset;
-        const bool stood = before.roots.contains(root);
+        const bool existed = before.roots.contains(root);
         const ctl_binding *old = find_binding(before.bindings, name);
-        if (!stood && !removed &&
+        if (!existed && !removed &&
             std::find(out.created.begin(), out.created.end(), root) == out.created.end())
             out.created.push_back(root);
-        if (removed && stood && name == root)
+        if (removed && existed && name == root)
             ended.insert(root);
-        if (!stood || name == root)
+        if (!existed || name == root)
             continue;
         const schema_row *row = find_schema_row(parsed_name(name));
         const std::string after = !removed               ? kept_value(name, item.binding.value)
@@ -357,9 +357,8 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
     }
     for (const auto &[root, words] : whole)
         if (!ended.contains(root))
-            out.notes.push_back("group " + number_of(root) + ": wccpd takes a change of " +
-                                join_words(words) +
-                                " only with the group as a whole, which is deleted and created again for it");
+            out.notes.push_back("group " + number_of(root) + ": wccpd applies a change of " +
+                                join_words(words) + " only by recreating the group");
     for (const auto &[root, words] : at_start)
         if (!ended.contains(root) && !whole.contains(root))
             out.notes.push_back("group " + number_of(root) + ": " +

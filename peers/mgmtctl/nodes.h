@@ -1,5 +1,5 @@
-// What mgmtctl knows about nodes beyond their names: which nodes can exist, what a change of one means for a
-// running group, and which name somebody may have meant.
+// What mgmtctl knows about nodes beyond their names: which nodes can exist, the effect of a change of one on
+// a running group, and which name somebody may have meant.
 #pragma once
 
 #include <functional>
@@ -32,7 +32,7 @@ bool query_appliances(const ctl_ask &ask, const std::string &list, unsigned long
 // asks for them, and inserts them where they belong. False: no answer.
 bool add_appliances(const ctl_ask &ask, const std::string &root, std::vector<ctl_binding> *inout);
 
-// NAME VALUE, or NAME=VALUE..., as items of one commit. Returns "", or what is wrong.
+// NAME VALUE, or NAME=VALUE..., as items of one commit. Returns "", or the error.
 std::string parse_assignments(const std::vector<std::string> &words, ctl_change change,
                               std::vector<ctl_change_item> *out);
 

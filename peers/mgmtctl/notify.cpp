@@ -349,15 +349,15 @@ int run_notifier(const ctl_options &options, const ctl_notify_options &how) {
 int list_commands(const ctl_options &options, const ctl_notify_options &how) {
     const notify_commands found = find_notify_commands(how.directory);
     if (options.json) {
-        put(json_line({{"commands", found.paths}, {"refused", found.refused}}));
+        write_output(json_line({{"commands", found.paths}, {"refused", found.refused}}));
         return CTL_OK;
     }
     for (const std::string &path : found.paths)
-        put(path + "\n");
+        write_output(path + "\n");
     for (const std::string &line : found.refused)
-        put("refused: " + line + "\n");
+        write_output("refused: " + line + "\n");
     if (found.paths.empty() && found.refused.empty())
-        put("no command is in " + how.directory + "\n");
+        write_output("no command is in " + how.directory + "\n");
     return CTL_OK;
 }
 
@@ -369,5 +369,5 @@ int ctl_notify(const ctl_options &options, const std::string &word, const ctl_no
     if (word == "list")
         return list_commands(options, how);
     return tell_failure(options,
-                        {CTL_USAGE, "", "\"notify " + word + "\" is no command: run or list", "", 0});
+                        {CTL_USAGE, "", "\"notify " + word + "\" is not a command: run or list", "", 0});
 }

@@ -18,7 +18,7 @@
 #include <unistd.h>
 
 extern "C" {
-#include <sys/pidfd.h> // glibc 2.36 lacks this in the header
+#include <sys/pidfd.h> // without extern "C" of its own in glibc 2.36
 }
 
 #include "peers/mgmtctl/show_model.h"

@@ -66,7 +66,7 @@ const std::vector<reason_text> &reason_texts() {
         {"view-length", true, "the view of {who} has {offered}, but its content needs {wanted}",
          "set the router's kind: mgmtctl group set {group} compatibility ios or nexus"},
         {"message-length", true, "a message from {who} has {offered}, but {wanted}",
-         "look for a path that cuts packets (MTU, firewall)"},
+         "look for a path that truncates packets (MTU, firewall)"},
         {"message-malformed", true, "a message from {who} has {offered}; expected: {wanted}",
          "capture it (udp port 2048); the router or the path breaks it"},
         {"message-type", false, "{who} sends messages of {offered}, which are not for an appliance",
@@ -89,7 +89,7 @@ const std::vector<reason_text> &reason_texts() {
         {"group-stopped", false, "{who} sends messages while the group cannot run",
          "see the other reasons of the group"},
         {"query-refused", false, "{who} sent {offered}",
-         "nothing, unless it goes on; then restart the group"},
+         "nothing, unless it continues; then restart the group"},
         // Tunnels.
         {"mailbox-missing", true, "wccpd has no mailbox to tunneld: {who} gets no tunnel",
          "another wccpd owns it: stop that one, then restart wccpd"},
@@ -133,25 +133,25 @@ const std::vector<reason_text> &reason_texts() {
         {"redirected-elsewhere", true, "this appliance gets nothing: the routers redirect to {offered}",
          "check that the designated appliance lists this one and gives it a weight"},
         {"not-designated", false, "{who} is designated: it has the lowest address and makes the table",
-         "nothing; look there for what is wrong with the table"},
+         "nothing; if the table is wrong, examine that appliance"},
         // Traffic.
-        {"lack", true, "all packets are returned: the kernel lacks what sorts them",
+        {"lack", true, "all packets are returned: the kernel lacks features that sort them",
          "load the kernel's modules, or use --plane user; then restart tunneld"},
         {"failure", true, "the kernel is not as wanted: something in it could not be changed",
          "tunneld tries again; its log has the details"},
-        {"proxy-down", true, "the proxy is down; the last check says why",
+        {"proxy-down", true, "the proxy is down; the last check has the reason",
          "start the proxy: mgmtctl intercept show {group}"},
         {"overload", true, "the proxy has too many flows; new ones are returned",
          "more appliances, a larger limit, or less weight"},
         {"slow-start", false, "slow start: a part of the weight is announced",
          "nothing: the weight rises by itself"},
         {"standing-by", false, "not ACTIVE; new flows are returned",
-         "nothing while it is a backup; mgmtctl explain {group} has what it waits for"},
+         "nothing while it is a backup; mgmtctl explain {group} shows what it is waiting for"},
         {"own-traffic", true, "the router redirects this appliance's own traffic",
          "exclude this appliance's addresses from redirection on the router"},
-        {"refused-source", true, "GRE comes from {who}, which is no router of ours",
+        {"refused-source", true, "GRE comes from {who}, which is not one of our routers",
          "accept it when it is the router's: mgmtctl tunnel accept {who}"},
-        {"fragments", true, "packets come in fragments, and the MSS of no flow has been clamped",
+        {"fragments", true, "packets arrive in fragments, and the MSS of no flow has been clamped",
          "raise the MTU towards the routers, or let the MSS be clamped"},
         {"no-intercept", true, "the routers redirect, but no intercept takes the packets: all are returned",
          "mgmtctl intercept add {group} port 80 to PORT"},
@@ -350,7 +350,7 @@ void add_changes_not_followed(const snapshot_group &group, reason_list *list) {
     }
 }
 
-// wccpd is given "down" for it then.
+// mgmtd then gives wccpd "down" for its admin.
 bool is_out_of_its_routers(const snapshot &shown, const snapshot_group &group) {
     return shown.traffic.left.contains(group.id) ||
            std::any_of(shown.traffic.drains.begin(), shown.traffic.drains.end(),
@@ -394,7 +394,7 @@ void add_group_reasons(const snapshot &shown, const snapshot_group &group, reaso
                     [&](const traffic_intercept &each) { return each.group == group.id; });
     if (sorts && !intercepted && group.state == "ACTIVE") {
         list->add_state("no-intercept", group, "", "");
-        // It may be the group for what servers answer to the proxies of another group.
+        // It may be the group for servers' replies to the proxies of another group.
         list->reasons.back().harmless = !shown.traffic.intercepts.empty();
     }
 }

@@ -7,7 +7,7 @@
 
 #include "peers/mgmtctl/show_model.h"
 
-// The words of a code. "{who}", "{offered}", "{wanted}" and "{group}" stand for the values of a reason.
+// The words of a code. "{who}", "{offered}", "{wanted}" and "{group}" are replaced by the values of a reason.
 struct reason_text {
     const char *code;  // stable: in JSON, alarms and documents
     bool attention;    // somebody has to do something, or to wait for something

@@ -29,7 +29,7 @@ std::string without_controls(std::string text) {
 }
 } // namespace
 
-void put(const std::string &text) {
+void write_output(const std::string &text) {
     static const bool terminal = isatty(STDOUT_FILENO);
     const std::string &shown = terminal ? without_controls(text) : text;
     (void)fwrite(shown.data(), 1, shown.size(), stdout);
@@ -126,7 +126,7 @@ int tell_failure(const ctl_options &options, const ctl_failure &failure) {
     if (ctl_stop_signal)
         return failure.exit;
     if (options.json)
-        put(json_line(json_failure(failure)));
+        write_output(json_line(json_failure(failure)));
     else
         fputs(text_failure(failure).c_str(), stderr);
     return failure.exit;

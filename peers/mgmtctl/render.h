@@ -11,7 +11,7 @@
 using ctl_json = nlohmann::ordered_json; // complete only where nlohmann/json.hpp is included
 
 // To standard output; a failed write is reported at the end of the program.
-void put(const std::string &text);
+void write_output(const std::string &text);
 std::string json_line(const ctl_json &value); // with its newline
 
 // Numbers and durations become JSON numbers, booleans JSON booleans, a node without a value null.

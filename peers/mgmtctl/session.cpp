@@ -75,7 +75,7 @@ bool is_connected(const ctl_session *self) {
 }
 
 lc_status nothing_to_note(const fdic_event_array *, void *) {
-    return LC_OK; // each round reads the list anew
+    return LC_OK; // each round reads the list again
 }
 
 void call_ready(const fdic_event_array *events, const std::vector<pollfd> &polled) {

@@ -1,4 +1,4 @@
-// One session of mgmtctl with mgmtd: requests that wait for their answers, and events as they come.
+// One session of mgmtctl with mgmtd: requests that wait for their answers, and events as they arrive.
 #pragma once
 
 #include <csignal>
@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-// A binding as text: the type is its name ("uint32", "string", "ipv4addr"), the value what a person reads.
+// A binding as text: the type is its name ("uint32", "string", "ipv4addr"), the value as a person reads it.
 struct ctl_binding {
     std::string name; // "/a/b"; a "/" within a part is written "\/"
     std::string type;
@@ -50,12 +50,12 @@ void ctl_query_quietly(ctl_session *session);
 // False, with the reason, when there was no answer; the session cannot be used any more.
 bool ctl_query(ctl_session *session, ctl_walk walk, const std::string &name, ctl_reply *out,
                std::string *out_reason);
-// Several names in one request. What does not exist is left out of the answer.
+// Several names in one request. Nodes that do not exist are left out of the answer.
 bool ctl_query_all(ctl_session *session, ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out,
                    std::string *out_reason);
 // How a commit is made.
 struct ctl_order {
-    std::string cause;            // what it is for, in the history
+    std::string cause;            // its purpose, for the history
     bool check_only = false;      // only check whether it would be accepted
     bool ends_wait = false;       // allowed while another commit waits to be confirmed, which it ends
     uint32_t revision = 0;        // refused when the configuration has another one; 0: any
@@ -70,7 +70,7 @@ bool ctl_action(ctl_session *session, const std::string &name, const std::vector
 bool ctl_add_interest(ctl_session *session, const std::string &event,
                       const std::vector<std::string> &patterns, std::string *out_reason);
 // Waits for the next event, which may have arrived during a request. 1: here it is; 0: none within `wait_ms`
-// (-1: no limit); -1: the session has ended, with the reason. A signal ends the wait with 0, and so does
+// (-1: no limit); -1: the session has ended, with the reason. A signal ends the wait with 0, as does
 // `other_fd` (-1: none) when it can be read.
 int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::string *out_reason,
                    int other_fd = -1);

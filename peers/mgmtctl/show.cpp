@@ -182,7 +182,7 @@ void show_screen(viewer *self, const snapshot &shown) {
     write_out(self, text);
 }
 
-// The first that is wanted.
+// The first one whose condition holds is used.
 const renderer renderers[] = {
     {[](const viewer &self) { return !self.options.html.empty(); }, show_page, false, PAGE_QUERIES},
     {[](const viewer &self) { return self.options.json; }, show_json, false, snapshot_limits{}.queries},
@@ -191,7 +191,7 @@ const renderer renderers[] = {
     {[](const viewer &) { return true; }, show_screen, true, snapshot_limits{}.queries},
 };
 
-snapshot look(const viewer &self, ctl_session *session) {
+snapshot view_snapshot(const viewer &self, ctl_session *session) {
     return gather_snapshot(
         [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
             return ctl_query(session, walk, name, out, out_reason);
@@ -208,7 +208,8 @@ void take_signal(int number) {
         ctl_stop_signal = number;
 }
 
-// Those that would leave the terminal as it is; main has taken the others. What was ignored stays so.
+// The signals after which the terminal has to be restored or redrawn, except those that main handles. An
+// ignored signal stays ignored.
 void take_signals() {
     struct sigaction action = {}, before;
     action.sa_handler = take_signal; // without SA_RESTART: it ends a wait
@@ -251,7 +252,7 @@ bool add_interests(ctl_session *session, std::string *out_reason) {
     });
 }
 
-// Until it is time for the next snapshot, after one that cost so long. False: the session has ended.
+// Waits until the next snapshot is due, after one that took this long. False: the session has ended.
 bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reason) {
     const int64_t began = lt_monotonic_ms();
     int64_t until = began + std::max(PERIOD_MS, 4 * cost_ms);
@@ -268,7 +269,7 @@ bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reaso
     return true;
 }
 
-int watch(viewer *self) {
+int watch_screen(viewer *self) {
     ctl_session *session = nullptr;
     take_signals();
     if (self->terminal)
@@ -286,7 +287,7 @@ int watch(viewer *self) {
         }
         const int64_t began = lt_monotonic_ms();
         if (session)
-            shown = look(*self, session);
+            shown = view_snapshot(*self, session);
         const int64_t cost_ms = lt_monotonic_ms() - began;
         if (ctl_stop_signal)
             break;
@@ -318,10 +319,10 @@ int ctl_show(const ctl_options &options) {
                             [&](const renderer &each) { return each.is_wanted(self); });
     setlocale(LC_CTYPE, "");
     if (options.watch)
-        return watch(&self);
+        return watch_screen(&self);
     snapshot shown;
     if (ctl_session *session = ctl_open(options.timeout_ms, &shown.unreachable)) {
-        shown = look(self, session);
+        shown = view_snapshot(self, session);
         ctl_close(session);
     }
     const bool reached = shown.unreachable.empty();

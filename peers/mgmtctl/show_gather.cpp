@@ -33,7 +33,7 @@ struct gathering {
     snapshot shown;
     size_t queries = 0;
 
-    // False ends the whole: there is no answer any more.
+    // False ends the gathering: there is no answer any more.
     bool ask(ctl_walk walk, const std::string &name, ctl_reply *out) {
         std::string reason;
         queries++;
@@ -44,7 +44,7 @@ struct gathering {
         shown.unreachable = reason.empty() ? "no answer" : clean_text(reason, 200);
         return false;
     }
-    // The same of wccpd's nodes; nothing comes once it doesn't answer.
+    // The same for wccpd's nodes; they are empty once it has not answered.
     bool ask_wccpd(ctl_walk walk, const std::string &name, ctl_reply *out) {
         *out = {};
         if (shown.wccpd != wccpd_condition::running)
@@ -229,7 +229,7 @@ bool gather_routers(gathering *work, snapshot_group *group, const std::vector<st
         const auto heard =
             std::find_if(group->routers.begin(), group->routers.end(),
                          [&](const snapshot_router &r) { return r.address == address || r.id == address; });
-        // A multicast address is where routers are looked for, and none itself.
+        // A multicast address serves to find routers and is not a router itself.
         if (heard != group->routers.end()) {
             heard->configured = true;
         } else if (const int first = number_of(address, 0); first < 224 || group->routers.empty()) {
@@ -262,7 +262,7 @@ bool gather_weights(gathering *work, snapshot_group *group, uint32_t count) {
     return true;
 }
 
-// Where the designated appliance doesn't tell what it allots, the weights do.
+// Without the designated appliance's own allotment, the weights determine the shares.
 void finish_shares(snapshot_group *group) {
     int64_t sum = 0;
     bool known = !group->appliances.empty();
@@ -333,7 +333,7 @@ bool gather_briefly(gathering *work, snapshot_group *group, const std::string &r
     return true;
 }
 
-// How many Here-I-Am no router answers.
+// The number of Here-I-Am sent, if a router does not answer.
 bool gather_sent(gathering *work, snapshot_group *group, const std::string &root) {
     ctl_reply reply;
     const bool silent =
@@ -348,7 +348,8 @@ bool gather_sent(gathering *work, snapshot_group *group, const std::string &root
     return true;
 }
 
-// A table is shown by the method that was agreed. What a router reports by another one is not what it shows.
+// A table is decoded by the agreed method. The table of a router that reports by another method would be
+// wrong.
 void drop_misread_tables(snapshot_group *group) {
     for (const snapshot_reason &reason : group->reasons)
         if (reason.code == "method-differs" && reason.offered.ends_with(" by the router"))
@@ -406,10 +407,10 @@ bool gather_alarms(gathering *work) {
     ctl_reply reply;
     if (!work->ask(ctl_walk::subtree, NODE_ALARMS_RAISED, &reply))
         return false;
-    const std::vector<ctl_alarm> standing = alarms_of(reply.bindings);
-    work->shown.alarms_total = standing.size();
-    for (size_t i = 0; i < std::min(standing.size(), work->limits.alarms); i++) {
-        const ctl_alarm &from = standing[i];
+    const std::vector<ctl_alarm> active_alarms = alarms_of(reply.bindings);
+    work->shown.alarms_total = active_alarms.size();
+    for (size_t i = 0; i < std::min(active_alarms.size(), work->limits.alarms); i++) {
+        const ctl_alarm &from = active_alarms[i];
         const size_t at = from.source.rfind(":grp:");
         work->shown.alarms.push_back(
             {number_of<long>(from.type, 0), clean_text(from.name, 31), clean_text(from.source, 63),
@@ -440,7 +441,7 @@ std::string first_value(const ctl_reply &reply) {
     return reply.bindings.empty() ? "" : clean_text(reply.bindings[0].value, 31);
 }
 
-// The ids of the groups below a root, as they stand in a walk of its children.
+// The ids of the groups below a root, in the order of a walk of its children.
 void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *inout) {
     for (const ctl_binding &binding : reply.bindings) {
         const std::vector<std::string> parts = parts_below(root, binding.name);
@@ -451,7 +452,7 @@ void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *inout) 
     std::sort(inout->begin(), inout->end());
 }
 
-void gather(gathering *work) {
+void gather_all(gathering *work) {
     ctl_reply alive, version, mode, states, configs;
     work->shown.wccpd = wccpd_condition::running;
     if (!work->ask(ctl_walk::node, NODE_SYSTEM_MODE, &mode) || !gather_alarms(work) ||
@@ -490,6 +491,6 @@ void gather(gathering *work) {
 
 snapshot gather_snapshot(const snapshot_query &query, const snapshot_limits &limits) {
     gathering work = {query, limits, {}, 0};
-    gather(&work);
+    gather_all(&work);
     return std::move(work.shown);
 }

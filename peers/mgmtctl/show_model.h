@@ -17,7 +17,7 @@ struct snapshot_load {
     uint32_t percent = 0; // of the router's assignment
 };
 struct snapshot_router {
-    std::string address; // that it speaks from, or that is configured for it
+    std::string address; // the source of its messages, or the configured one
     std::string id;
     bool configured = false;
     std::string connection; // "two-way", "one-way", "unknown"; "none": nothing is heard
@@ -29,7 +29,7 @@ struct snapshot_appliance {
     std::string address;
     bool self = false;
     int64_t weight = -1;                          // -1: unknown
-    int asked_percent = -1;                       // what the weights, or the designated appliance, give it
+    int asked_percent = -1;                       // its share by the weights, or by the designated appliance
     bool reported = false;                        // by a router, its share
     uint32_t least_percent = 0, most_percent = 0; // over the routers
 };
@@ -74,7 +74,7 @@ struct snapshot_group {
     std::vector<snapshot_router> routers;
     std::vector<snapshot_appliance> appliances;
     std::vector<snapshot_table> tables;
-    snapshot_table wanted; // what this appliance has sent as the designated one; without owners: unknown
+    snapshot_table wanted; // sent by this appliance as the designated one; without owners: unknown
 };
 struct snapshot_process {
     bool running = false;

@@ -59,8 +59,8 @@ void add_glyph(pen *line, const char *utf8, char ascii) {
     line->used++;
 }
 
-std::string format(const char *text, ...) __attribute__((format(printf, 1, 2)));
-std::string format(const char *text, ...) {
+std::string format_text(const char *text, ...) __attribute__((format(printf, 1, 2)));
+std::string format_text(const char *text, ...) {
     char buffer[256];
     va_list list;
     va_start(list, text);
@@ -217,7 +217,7 @@ void draw_head(screen *on, size_t alarms_most) {
 
 void draw_group_head(screen *on, const snapshot_group &group) {
     pen line = on->begin();
-    add_cells(&line, format("%-4d", group.id), style::bold);
+    add_cells(&line, format_text("%-4d", group.id), style::bold);
     const reason *cause = main_reason(on->reasons, group.id);
     const auto [words, how] = group_state_words(on->shown, group, cause != nullptr);
     add_cells(&line, words, how);
@@ -229,9 +229,9 @@ void draw_group_head(screen *on, const snapshot_group &group) {
                               (group.interface.empty() ? "" : "on " + group.interface);
     for (const std::string &part :
          {group.uptime_ms ? "up " + duration_text(group.uptime_ms) : "", place, group.protocol,
-          group.weight >= 0 ? format("weight %" PRId64, group.weight) : "",
+          group.weight >= 0 ? format_text("weight %" PRId64, group.weight) : "",
           std::string(group.authenticated ? "md5" : ""),
-          group.policy >= 0 ? format("policy %" PRId64, group.policy) : ""})
+          group.policy >= 0 ? format_text("policy %" PRId64, group.policy) : ""})
         if (!part.empty())
             on->add_part(&line, part);
     on->end(&line);
@@ -245,7 +245,7 @@ void draw_group_head(screen *on, const snapshot_group &group) {
 void draw_router(screen *on, const snapshot_group &group, const snapshot_router &router) {
     const auto method = [](const std::string &word) { return word.empty() ? "-" : word.c_str(); };
     pen line = on->begin();
-    add_cells(&line, format("  router %-15s ", router.address.c_str()));
+    add_cells(&line, format_text("  router %-15s ", router.address.c_str()));
     if (router.connection == "none" || on->shown.wccpd != wccpd_condition::running) {
         const snapshot_reason *noted = router_reason(on->shown, group, router);
         if (on->shown.wccpd != wccpd_condition::running)
@@ -255,11 +255,11 @@ void draw_router(screen *on, const snapshot_group &group, const snapshot_router 
         else
             add_cells(&line, noted ? noted->code : "nothing heard", style::bad);
     } else {
-        add_cells(&line, format("%-7s", router.connection.c_str()),
+        add_cells(&line, format_text("%-7s", router.connection.c_str()),
                   router.connection == "two-way" ? style::good : style::warn);
-        add_cells(&line, format("  %8s", duration_text(router.connected_ms).c_str()));
-        on->add_part(&line, format("fwd %-3s  assign %-4s  return %s", method(router.forward),
-                                   method(router.assign), method(router.back)));
+        add_cells(&line, format_text("  %8s", duration_text(router.connected_ms).c_str()));
+        on->add_part(&line, format_text("fwd %-3s  assign %-4s  return %s", method(router.forward),
+                                        method(router.assign), method(router.back)));
         if (router.id != router.address)
             on->add_part(&line, "id " + router.id, style::dim);
     }
@@ -291,12 +291,15 @@ void draw_appliance(screen *on, const snapshot_appliance &one, int place) {
     set_style(&line, "1;38;5;" + std::to_string(colour_of(place)));
     add_cells(&line, std::string(1, appliance_letter(place)));
     set_style(&line, "0");
-    add_cells(&line, format(" %-15s %-4s ", one.address.c_str(), one.self ? "this" : ""));
-    add_cells(&line, one.weight < 0 ? format("%-13s", "") : format("weight %-6" PRId64, one.weight));
-    add_cells(&line, one.asked_percent < 0 ? format("%-11s", "") : format("asked %3d%% ", one.asked_percent));
+    add_cells(&line, format_text(" %-15s %-4s ", one.address.c_str(), one.self ? "this" : ""));
+    add_cells(&line,
+              one.weight < 0 ? format_text("%-13s", "") : format_text("weight %-6" PRId64, one.weight));
+    add_cells(&line, one.asked_percent < 0 ? format_text("%-11s", "")
+                                           : format_text("asked %3d%% ", one.asked_percent));
     const bool short_of = one.reported && one.asked_percent >= 0 &&
                           std::abs(static_cast<int>(one.least_percent) - one.asked_percent) > 1;
-    add_cells(&line, format("has %-7s ", share_words(one).c_str()), short_of ? style::warn : style::plain);
+    add_cells(&line, format_text("has %-7s ", share_words(one).c_str()),
+              short_of ? style::warn : style::plain);
     draw_bar(&line, one, place);
     on->end(&line);
 }
@@ -330,7 +333,7 @@ void draw_strip(screen *on, const snapshot_group &group, const snapshot_table &t
 
 // The places of up to `most` entries, those for which `first` holds before the others.
 template <typename Entry, typename First>
-std::vector<size_t> chosen(const std::vector<Entry> &all, size_t most, First first) {
+std::vector<size_t> choose_rows(const std::vector<Entry> &all, size_t most, First first) {
     std::vector<size_t> out;
     for (const bool wanted : {true, false})
         for (size_t i = 0; i < all.size() && out.size() < most; i++)
@@ -349,10 +352,10 @@ void draw_more(screen *on, size_t all, size_t most, const char *what) {
 void draw_group(screen *on, const snapshot_group &group, size_t most) {
     draw_group_head(on, group);
     for (const size_t i :
-         chosen(group.routers, most, [](const auto &r) { return r.connection != "two-way"; }))
+         choose_rows(group.routers, most, [](const auto &r) { return r.connection != "two-way"; }))
         draw_router(on, group, group.routers[i]);
     draw_more(on, group.routers.size(), most, "router");
-    for (const size_t i : chosen(group.appliances, most, [](const auto &one) { return one.self; }))
+    for (const size_t i : choose_rows(group.appliances, most, [](const auto &one) { return one.self; }))
         draw_appliance(on, group.appliances[i], static_cast<int>(i));
     draw_more(on, group.appliances.size(), most, "appliance");
     for (size_t i = 0; i < std::min(group.tables.size(), most); i++)
@@ -370,10 +373,10 @@ void draw_traffic(screen *on, size_t most) {
     const traffic_state &traffic = on->shown.traffic;
     on->text(traffic_head(traffic), style::bold);
     for (const size_t i :
-         chosen(traffic.intercepts, most, [](const auto &one) { return one.proxy == "down"; })) {
+         choose_rows(traffic.intercepts, most, [](const auto &one) { return one.proxy == "down"; })) {
         const traffic_intercept &one = traffic.intercepts[i];
         pen line = on->begin();
-        add_cells(&line, format("  %-4d", one.group));
+        add_cells(&line, format_text("  %-4d", one.group));
         add_cells(&line, proxy_text(one),
                   one.proxy == "up"     ? style::good
                   : one.proxy == "down" ? style::bad
@@ -414,13 +417,14 @@ std::vector<std::string> draw_briefly(const snapshot &shown, const screen_form &
         if (form.rows > 0 && on.lines.size() + 1 + last > static_cast<size_t>(form.rows))
             break;
         pen line = on.begin();
-        add_cells(&line, format("%-4d", group.id), style::bold);
+        add_cells(&line, format_text("%-4d", group.id), style::bold);
         const reason *cause = main_reason(on.reasons, group.id);
         const auto [words, how] = group_state_words(shown, group, cause != nullptr);
-        add_cells(&line, format("%-20s", words.c_str()), how);
+        add_cells(&line, format_text("%-20s", words.c_str()), how);
         add_cells(&line, cause || is_in_alarm(shown, group) ? " !" : "  ", style::bad);
         add_cells(&line, cause ? "  " + cause->code : "", style::warn);
-        add_cells(&line, group.uptime_ms ? format("  up %-11s", duration_text(group.uptime_ms).c_str()) : "");
+        add_cells(&line,
+                  group.uptime_ms ? format_text("  up %-11s", duration_text(group.uptime_ms).c_str()) : "");
         add_cells(&line, one_line(group, shown.brief));
         on.end(&line);
         drawn++;

@@ -1,8 +1,8 @@
 // Only wccpd's texts say which appliance has which bucket, what the designated appliance wants and allots,
 // and the state of a group's interface.
 //
-// The texts are rows of a label and a value. Unknown rows are skipped, and a text that was cut gives what
-// came before the cut. Lines, routers, appliances and buckets are bounded by what the engine can have.
+// The texts are rows of a label and a value. Unknown rows are skipped, and of a truncated text the part
+// before the cut is used. Lines, routers, appliances and buckets are bounded by what the engine can have.
 //
 // The words of a table that a router reports are printed as they were stored: in a hash table the first
 // bucket is in the highest byte of each word, in a mask table in its lowest bit. In the designated
@@ -26,7 +26,7 @@ struct dump_row {
     std::string_view label, value;
 };
 
-std::string_view trimmed(std::string_view text) {
+std::string_view trim_line(std::string_view text) {
     const size_t first = text.find_first_not_of(" \t");
     if (first == std::string_view::npos)
         return {};
@@ -41,9 +41,9 @@ void each_row(std::string_view text, Take take) {
         text = end == std::string_view::npos ? std::string_view{} : text.substr(end + 1);
         const size_t colon = line.find(" : ");
         if (colon == std::string_view::npos)
-            take(dump_row{trimmed(line), {}});
+            take(dump_row{trim_line(line), {}});
         else
-            take(dump_row{trimmed(line.substr(0, colon)), trimmed(line.substr(colon + 3))});
+            take(dump_row{trim_line(line.substr(0, colon)), trim_line(line.substr(colon + 3))});
     }
 }
 

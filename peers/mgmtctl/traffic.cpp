@@ -358,7 +358,7 @@ void find_fragments(const traffic_state &state, const reason_list &list) {
         packets += tunnel.fragments;
     if (state.clamped == 0)
         add_counted(state, list, "fragments", packets,
-                    "packets come in fragments, and the MSS of no flow has been clamped");
+                    "packets arrive in fragments, and the MSS of no flow has been clamped");
 }
 
 void find_lacking_kernel(const traffic_state &state, const reason_list &list) {

@@ -39,18 +39,18 @@ ctl_json result_json(const traffic_result &result) {
 int tell_result(const ctl_options &options, const traffic_result &result) {
     const std::string subject = std::string(result.kind) + " " + result.subject;
     if (options.json) {
-        put(json_line(result_json(result)));
+        write_output(json_line(result_json(result)));
         return result.exit;
     }
     if (result.exit != CTL_OK)
         return tell_failure(
             options, {result.exit, result.subject.empty() ? "" : subject, result.error, "", result.code});
-    put(subject + " " + (result.done == "unchanged" ? "is as asked" : result.done) +
-        (result.note.empty() ? "" : " (" + result.note + ")") +
-        (result.tunneld == "absent"   ? "; tunneld has no session"
-         : result.tunneld == "silent" ? "; tunneld does not answer"
-                                      : "") +
-        "\n");
+    write_output(subject + " " + (result.done == "unchanged" ? "is as asked" : result.done) +
+                 (result.note.empty() ? "" : " (" + result.note + ")") +
+                 (result.tunneld == "absent"   ? "; tunneld has no session"
+                  : result.tunneld == "silent" ? "; tunneld does not answer"
+                                               : "") +
+                 "\n");
     return result.exit;
 }
 
@@ -97,14 +97,14 @@ struct traffic_queries {
 
 void put_absence(tunneld_condition condition) {
     if (condition != tunneld_condition::running)
-        put(condition == tunneld_condition::absent ? "tunneld has no session\n"
-                                                   : "tunneld does not answer\n");
+        write_output(condition == tunneld_condition::absent ? "tunneld has no session\n"
+                                                            : "tunneld does not answer\n");
 }
 
 void put_reasons(const std::vector<traffic_reason> &reasons, int group) {
     for (const traffic_reason &reason : reasons)
         if (reason.group == group && reason.word != "proxy-down") // printed with the proxy already
-            put((group < 0 ? "" : "  ") + reason.text + "\n");
+            write_output((group < 0 ? "" : "  ") + reason.text + "\n");
 }
 
 // --- Intercepts
@@ -150,15 +150,16 @@ int tell_intercepts(const ctl_options &options, const ctl_link &link, const std:
         all.push_back(intercept_json(number, nodes, state, traffic));
         if (options.json)
             continue;
-        put(number + " " + intercept_clauses(nodes) + "\n");
+        write_output(number + " " + intercept_clauses(nodes) + "\n");
         if (state)
-            put("  " + proxy_text(*state) +
+            write_output(
+                "  " + proxy_text(*state) +
                 (state->proxy == "up" || state->proxy_reason.empty() ? "" : ": " + state->proxy_reason) +
                 "\n  " + sorted_text(state->sorted) + "\n");
         put_reasons(reasons, std::atoi(number.c_str()));
     }
     if (options.json)
-        put(json_line({{"tunneld", tunneld_word(traffic.tunneld)}, {"intercepts", all}}));
+        write_output(json_line({{"tunneld", tunneld_word(traffic.tunneld)}, {"intercepts", all}}));
     else
         put_absence(traffic.tunneld);
     return CTL_OK;
@@ -170,15 +171,15 @@ int list_clauses(const ctl_options &options) {
     for (const intercept_word &word : intercept_words()) {
         const char *fallback = intercept_word_fallback(word);
         if (!options.json)
-            put(word.word + std::string(12 - std::string(word.word).size(), ' ') + word.values +
-                (fallback && *fallback ? std::string("; default ") + fallback : "") + "\n");
+            write_output(word.word + std::string(12 - std::string(word.word).size(), ' ') + word.values +
+                         (fallback && *fallback ? std::string("; default ") + fallback : "") + "\n");
         all.push_back({{"word", word.word},
                        {"node", word.node},
                        {"values", word.values},
                        {"default", fallback ? ctl_json(fallback) : ctl_json(nullptr)}});
     }
     if (options.json)
-        put(json_line(all));
+        write_output(json_line(all));
     return CTL_OK;
 }
 } // namespace
@@ -207,15 +208,15 @@ int tell_bypasses(const ctl_options &options, const ctl_link &link) {
         const int64_t until = found == nodes.end() ? 0 : std::atoll(found->second.c_str());
         const int64_t left = until - time(nullptr);
         if (!options.json)
-            put(prefix +
-                (until == 0  ? ""
-                 : left <= 0 ? "  is over"
-                             : "  for " + std::to_string(left) + " s more") +
-                "\n");
+            write_output(prefix +
+                         (until == 0  ? ""
+                          : left <= 0 ? "  is over"
+                                      : "  for " + std::to_string(left) + " s more") +
+                         "\n");
         all.push_back({{"prefix", prefix}, {"until", until ? ctl_json(until) : ctl_json(nullptr)}});
     }
     if (options.json)
-        put(json_line({{"tunneld", tunneld_word(traffic.tunneld)}, {"bypasses", all}}));
+        write_output(json_line({{"tunneld", tunneld_word(traffic.tunneld)}, {"bypasses", all}}));
     else
         put_absence(traffic.tunneld);
     return CTL_OK;
@@ -243,33 +244,34 @@ std::string count_of_bytes(const traffic_count &count) {
 }
 
 void put_protection(const protection_state &state) {
-    put("protection of flows " +
-        (state.time ? "for " + std::to_string(state.time) + " s" : std::string("switched off")) + "\n  " +
-        protection_text(state.sum) + "\n");
+    write_output("protection of flows " +
+                 (state.time ? "for " + std::to_string(state.time) + " s" : std::string("switched off")) +
+                 "\n  " + protection_text(state.sum) + "\n");
     for (const protected_group &each : state.groups)
-        put("  group " + std::to_string(each.group) +
-            (each.covered ? "  " + std::to_string(each.slots) + " slots passed on\n"
-                          : "  not covered: " + each.reason + "\n"));
+        write_output("  group " + std::to_string(each.group) +
+                     (each.covered ? "  " + std::to_string(each.slots) + " slots passed on\n"
+                                   : "  not covered: " + each.reason + "\n"));
     for (const auto &[address, counts] : state.members)
-        put("  appliance " + address + "  " + protection_text(counts) + "\n");
+        write_output("  appliance " + address + "  " + protection_text(counts) + "\n");
 }
 
 void put_tunnels(const traffic_state &traffic) {
-    put("data plane " + traffic.plane + "\n" +
-        (traffic.plane_reason.empty() ? "" : "  not used: " + traffic.plane_reason + "\n") +
-        refused_text(traffic.refused));
+    write_output("data plane " + traffic.plane + "\n" +
+                 (traffic.plane_reason.empty() ? "" : "  not used: " + traffic.plane_reason + "\n") +
+                 refused_text(traffic.refused));
     for (const traffic_tunnel &tunnel : traffic.tunnels)
-        put("tunnel " + std::to_string(tunnel.id) + "  " + tunnel.local + " to " + tunnel.remote +
-            (tunnel.interface.empty() ? "" : "  on " + tunnel.interface) + "  index " +
-            std::to_string(tunnel.index) + "\n  in " + count_of_bytes(tunnel.in) + "  out " +
-            count_of_bytes(tunnel.out) + "  fragments " + count_text(tunnel.fragments) +
-            "\n  sorted: " + sorted_text(tunnel.sorted) + "\n" + refused_text(tunnel.refused));
+        write_output("tunnel " + std::to_string(tunnel.id) + "  " + tunnel.local + " to " + tunnel.remote +
+                     (tunnel.interface.empty() ? "" : "  on " + tunnel.interface) + "  index " +
+                     std::to_string(tunnel.index) + "\n  in " + count_of_bytes(tunnel.in) + "  out " +
+                     count_of_bytes(tunnel.out) + "  fragments " + count_text(tunnel.fragments) +
+                     "\n  sorted: " + sorted_text(tunnel.sorted) + "\n" + refused_text(tunnel.refused));
     if (traffic.protection.time != 0)
         put_protection(traffic.protection);
     for (const auto &[address, packets] : traffic.refused_sources)
-        put("refused " + count_text(packets) + " from " + address + "\n");
+        write_output("refused " + count_text(packets) + " from " + address + "\n");
     if (traffic.refused_sources.size() >= REFUSED_SOURCES_MAX)
-        put("refused sources beyond these " + std::to_string(REFUSED_SOURCES_MAX) + " are not listed\n");
+        write_output("refused sources beyond these " + std::to_string(REFUSED_SOURCES_MAX) +
+                     " are not listed\n");
 }
 } // namespace
 
@@ -287,12 +289,12 @@ int tell_tunnels(const ctl_options &options, const ctl_link &link) {
         out["accepted"].push_back(
             {{"address", address}, {"router", router.empty() ? ctl_json(nullptr) : ctl_json(router)}});
         if (!options.json)
-            put("accepted " + address + (router.empty() ? "" : " beside router " + router) + "\n");
+            write_output("accepted " + address + (router.empty() ? "" : " beside router " + router) + "\n");
     }
     if (!options.json)
         put_reasons(traffic_reasons(traffic), -1);
     if (options.json)
-        put(json_line(out));
+        write_output(json_line(out));
     else
         put_absence(traffic.tunneld);
     return running ? CTL_OK : CTL_UNREACHABLE;
@@ -314,7 +316,8 @@ int tell_protection(const ctl_options &options, const ctl_link &link) {
         return tell_failure(options, mgmtd.failure);
     const bool running = traffic.tunneld == tunneld_condition::running;
     if (options.json)
-        put(json_line({{"tunneld", tunneld_word(traffic.tunneld)},
+        write_output(
+            json_line({{"tunneld", tunneld_word(traffic.tunneld)},
                        {"protection", running ? protection_json(traffic.protection) : ctl_json(nullptr)}}));
     else if (running)
         put_protection(traffic.protection);

@@ -265,11 +265,11 @@ void print_event(const ctl_options &options, const ctl_event &event) {
     if (options.json) {
         ctl_json out = {{"time", time_text("%FT%T%z")}};
         out.update(json_event(event, options.secrets));
-        put(json_line(out));
+        write_output(json_line(out));
     } else {
         const std::string now = time_text("%T ");
         for (const std::string &line : text_event(event, options.secrets))
-            put(now + line + "\n");
+            write_output(now + line + "\n");
     }
 }
 
@@ -308,7 +308,7 @@ int ctl_watch(const ctl_options &options, const std::vector<std::string> &names,
     std::string reason;
     for (const std::string &name : names)
         if (node_name parsed; !parse_node_name(watch_pattern(name), &parsed))
-            return tell_failure(options, {CTL_USAGE, name, "is no name of a node", "", 0});
+            return tell_failure(options, {CTL_USAGE, name, "is not the name of a node", "", 0});
     ctl_session *session = ctl_open(options.timeout_ms, &reason);
     if (!session)
         return tell_failure(options, {CTL_UNREACHABLE, "", reason, "", 0});

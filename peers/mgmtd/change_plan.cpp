@@ -16,7 +16,7 @@ node_name find_unit(const node_name &name) {
 
 bool is_group(const node_name &name) {
     static const node_name pattern = parsed_name(NODE_GROUP_CONFIG "/*");
-    return matches(pattern, name);
+    return matches_pattern(pattern, name);
 }
 
 // Whether a running group, which exists before and after, applies the change.

@@ -1,5 +1,5 @@
 // Changes of the configuration: set requests of sessions, and the configuration file when it is read again. A
-// commit is checked, then saved, then taken over, and then reported by events: nobody hears of a change that
+// commit is checked, then saved, then put into force, and then reported by events: no change is reported that
 // a crash could lose.
 #include <algorithm>
 #include <cerrno>
@@ -126,14 +126,14 @@ void write_facility(const server *self) {
         if (!line.starts_with("system "))
             content += line + "\n";
     if (good && content != before) {
-        std::error_code ignored; // if this fails, so does the write, which gives the reason
+        std::error_code ignored; // if this fails, the write fails as well and gives the reason
         std::filesystem::create_directories(std::filesystem::path(self->facility_file).parent_path(),
                                             ignored);
         good = replace_file(self->facility_file, content, 0644, nullptr, &reason);
     }
     if (!good)
-        self->say("the log facility is not written for programs that start: " + self->facility_file + ": " +
-                  reason);
+        self->say("the log facility of starting programs could not be written: " + self->facility_file +
+                  ": " + reason);
 }
 
 } // namespace
@@ -168,8 +168,8 @@ commit_result refuse_commit(uint32_t code, const std::string &reason) {
 commit_result prepare_commit(server *self, const std::vector<set_step> &steps, const commit_order &order,
                              node_tree *out_next) {
     if (order.revision && order.revision != self->tree.revision)
-        return refuse_commit(LC_ASSERTION, "The configuration has been changed since (commit " +
-                                               std::to_string(self->tree.revision) + "): look again");
+        return refuse_commit(LC_ASSERTION, "The configuration has changed meanwhile (commit " +
+                                               std::to_string(self->tree.revision) + "): read it again");
     commit_result result = tree_prepare(self->tree, steps, out_next);
     std::string reason;
     if (result.code != 0)
@@ -233,7 +233,7 @@ int64_t server_expire_bypasses(server *self) {
     int64_t wait_ms = -1;
     for (auto at = self->tree.nodes.upper_bound(root);
          at != self->tree.nodes.end() && at->first.is_under(root); ++at) {
-        const int64_t until = matches(pattern, at->first) ? std::stoll(at->second.text) : 0;
+        const int64_t until = matches_pattern(pattern, at->first) ? std::stoll(at->second.text) : 0;
         if (until != 0 && until <= clock)
             over.push_back(
                 {set_kind::remove, root.below(at->first.parts[root.parts.size()]).text(), bn_type_none, ""});
@@ -274,7 +274,7 @@ bool server_load(server *self, std::string *out_errors, std::string *out_warning
 
 void server_begin(server *self) {
     if (!self->file.path.empty() && remove_unfinished_file(self->file.path))
-        self->say("removed what a commit that was cut short has left beside " + self->file.path);
+        self->say("removed the leftover of an interrupted commit beside " + self->file.path);
     if (const std::string open = config_protect(self->file.path); !open.empty())
         self->say(open);
     write_facility(self);

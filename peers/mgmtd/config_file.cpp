@@ -40,7 +40,7 @@ bool reads_the_same(const std::string &written, const node_tree &tree, std::stri
     config_text again;
     if (config_parse(written, "what was written", &again) && again.tree.set == tree.set)
         return true;
-    *out_reason = "what was written would not be read the same";
+    *out_reason = "the written text would not be read as the same configuration";
     if (!again.errors.empty())
         *out_reason += ": " + again.errors.substr(0, again.errors.find('\n'));
     return false;

@@ -17,5 +17,5 @@ bool config_load(config_file *file, config_text *out);
 // configuration.
 bool config_save(config_file *file, const node_tree &tree, const config_comments &comments,
                  std::string *out_reason);
-// Removes the rights of group and others. Gives a line for the log, or "" if there was nothing to remove.
+// Removes the rights of group and others. Returns a line for the log, or "" if there was nothing to remove.
 std::string config_protect(const std::string &path);

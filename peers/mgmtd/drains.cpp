@@ -4,9 +4,8 @@
 // its routers. It stays out until the drain is cancelled or the group deleted. The time is kept here because
 // it has to end without tunneld as well.
 //
-//   /qv/alarms/state/drain/GROUP    "draining", "drained", or "over" if it has left with flows; below it
-//   since,
-//                                   until (seconds since 1970), and flows once tunneld has counted them
+//   /qv/alarms/state/drain/GROUP    "draining", "drained", or "over" if it has left with flows
+//                                   below it: since, until (seconds since 1970), and flows, once counted
 //
 // Also here: groups that announce a part of their weight during a slow start, which tunneld controls.
 #include "mgmt/node_paths.h"
@@ -83,7 +82,7 @@ void begin_drain(server *self, uint8_t group, uint32_t seconds) {
     server_send_overlay(self, group, before);
 }
 
-// The groups of an action: the one that it names, or all that are up. Gives a status code.
+// The groups of an action: the one that it names, or all that are up. Returns a status code.
 uint32_t find_drain_groups(const server *self, const std::vector<event_field> &fields,
                            std::vector<uint8_t> *out, std::string *out_message) {
     uint32_t group = 0;
@@ -95,7 +94,7 @@ uint32_t find_drain_groups(const server *self, const std::vector<event_field> &f
         return LC_OK;
     }
     if (!read_number_field(fields, "group", bn_type_uint8, &group)) {
-        *out_message = "group is no number between 0 and 255";
+        *out_message = "group is not a number between 0 and 255";
         return LC_BAD_ARGUMENT;
     }
     const std::string *admin = find_configured_admin(self, static_cast<uint8_t>(group));
@@ -118,7 +117,7 @@ uint32_t server_begin_drain(server *self, const std::vector<event_field> &fields
     if (!find_field(fields, "seconds")) {
         seconds = static_cast<uint32_t>(std::stoul(self->tree.nodes.at(parsed_name(NODE_DRAIN_TIME)).text));
     } else if (!read_number_field(fields, "seconds", bn_type_uint32, &seconds) || seconds > SECONDS_MAX) {
-        *out_message = "seconds is no number between 0 and " + std::to_string(SECONDS_MAX);
+        *out_message = "seconds is not a number between 0 and " + std::to_string(SECONDS_MAX);
         return LC_BAD_ARGUMENT;
     }
     if (groups.size() == 1 && *find_configured_admin(self, groups[0]) != "up") {
@@ -236,7 +235,7 @@ int64_t server_end_drains(server *self) {
         }
         const group_overlay before = server_overlay_of(self, group);
         self->slowed.erase(group);
-        self->say(describe_group(group) + " announces its weight again: nobody reports");
+        self->say(describe_group(group) + " announces its full weight again: no tunneld reports");
         server_send_overlay(self, group, before);
     }
     return next;

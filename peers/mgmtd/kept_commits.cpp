@@ -5,12 +5,12 @@
 //   /mgmtd/config/state/commit/N/text            the text of the configuration after it
 //   /mgmtd/config/state/commit/N/confirm_by      only while it waits to be confirmed, as returns_to
 //
-// The texts are made when they are asked for by name. Walks leave them out.
+// The texts are made when they are queried by name. Walks leave them out.
 //
-// Only the last commit can wait to be confirmed, because no other is taken meanwhile. When its time is over,
-// the configuration before it is restored by a new commit. The time runs by the monotonic clock. Over a
-// restart of mgmtd only the wall clock is left; a wall clock that was set back cannot make the time longer
-// than was asked for.
+// Only the last commit can wait to be confirmed, because no other is accepted meanwhile. When its time is
+// over, the configuration before it is restored by a new commit. The time is measured by the monotonic clock.
+// Across a restart of mgmtd only the wall clock remains; a wall clock that was set back cannot make the time
+// longer than was requested.
 #include <algorithm>
 
 #include "mgmt/node_paths.h"
@@ -79,7 +79,7 @@ bool server_config_text(const server *self, const node_name &name, bool hide, no
     static const node_name present = parsed_name(NODE_CONFIG_TEXT),
                            kept = parsed_name(NODE_COMMITS "/*/text");
     *out = {bn_type_str, ""};
-    if (matches(kept, name))
+    if (matches_pattern(kept, name))
         return kept_text(self, name, hide, &out->text);
     if (!(name == present)) // checked first: every node of every query is looked up here, and the text is
                             // slow to make

@@ -99,8 +99,8 @@ void server_take_join(server *self, uint32_t peer_id, const std::vector<event_fi
         end_leave(self, group, "reported by tunneld");
 }
 
-// A restarted tunneld does not know which groups its predecessor has taken out, and so reports no join for
-// them. A proxy that is up means the same.
+// A restarted tunneld does not know which groups its predecessor has taken out, and therefore reports no join
+// for them. A proxy that is up means the same.
 void server_take_proxy_change(server *self, uint32_t peer_id, const std::vector<event_field> &fields) {
     uint8_t group = 0;
     const std::string *up = find_field(fields, "up");

@@ -238,7 +238,7 @@ void listener_check(listener *self) {
     close_place(self);
     std::string error;
     if (open_place(self, &error)) {
-        self->say(self->path + " was removed, made again");
+        self->say(self->path + " was removed and has been made again");
         self->complaint.clear();
         return;
     }

@@ -6,7 +6,7 @@
 
 #include <sys/types.h>
 
-constexpr const char *VIEWERS_GROUP = "wccpd";                 // users who may look, but change nothing
+constexpr const char *VIEWERS_GROUP = "wccpd";                 // users with read-only access
 constexpr const char *MGMTD_LOCK_FILE = "/var/run/mgmtd.lock"; // when mgmtd runs as root
 
 struct listener {
@@ -25,7 +25,7 @@ struct listener {
 // Makes the directory and the socket. At no moment do they have another owner or a wider mode. False with the
 // reason, for example when another mgmtd runs.
 bool listener_open(listener *self, std::string *out_error);
-// To be called now and then. If the socket or its directory was removed or replaced, clients no longer find
+// Call it from time to time. If the socket or its directory was removed or replaced, clients no longer find
 // mgmtd; both are then made again. Open connections are not affected.
 void listener_check(listener *self);
 // Removes sockets whose clients no longer exist.

@@ -66,7 +66,7 @@ int64_t find_time_left(int64_t now, std::initializer_list<int64_t> due) {
     return left;
 }
 
-// Reports to the service manager that mgmtd is alive, when that is due. Gives when to call it again, or -1.
+// Reports to the service manager that mgmtd is alive, when that is due. Returns when to call it again, or -1.
 int64_t report_alive(int64_t *inout_at_ms) {
     if (service_watchdog_ms() < 0)
         return -1;
@@ -84,12 +84,12 @@ int64_t report_alive(int64_t *inout_at_ms) {
 int main(int argc, char **argv) {
     std::string config = "/etc/wccpd/mgmtd.conf", wccpd = "wccpd", tunneld = "tunneld";
     bool check = false, supervise = false;
-    CLI::App app{"The management daemon: keeps the configuration, reports its changes, asks for states."};
+    CLI::App app{"The management daemon: keeps the configuration, reports changes, queries states."};
     app.set_version_flag("--version", std::string("mgmtd ") + wccp_version());
-    app.add_option("--config", config, "the configuration file; it is written at each change")
+    app.add_option("--config", config, "the configuration file, rewritten at each change")
         ->capture_default_str();
-    app.add_flag("--check", check, "read the configuration file, report what is wrong with it, and end");
-    app.add_flag("--supervise", supervise, "start tunneld and wccpd, and start them again when they end");
+    app.add_flag("--check", check, "read the configuration file, report its errors, and exit");
+    app.add_flag("--supervise", supervise, "start tunneld and wccpd, and restart them when they exit");
     const auto has_word = [](const std::string &line) {
         return command_words(line).empty() ? std::string("no program is given") : std::string();
     };

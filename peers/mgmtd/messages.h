@@ -18,6 +18,5 @@ bn_request_msg *make_event(const std::string &name, const std::vector<event_fiel
 bn_request_msg *make_change_event(const std::vector<const node_change *> &changes);
 
 // In a pattern "*" is one part of a name, and "**" at the end is any number of parts, none included: "/a/**"
-// matches
-// "/a" as well, because who follows the nodes below a node also follows that node.
+// matches "/a" as well, because an interest in the nodes below a node includes that node.
 bool interest_matches(const std::string &pattern, const node_name &name);

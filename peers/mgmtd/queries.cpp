@@ -1,5 +1,5 @@
 // Queries. The configuration and the states that mgmtd keeps are answered from memory. The state nodes of a
-// daemon are asked of the daemon: the query waits, while other messages are handled.
+// daemon are requested from the daemon: the query waits while other messages are handled.
 //
 // The state nodes of each daemon are listed beside the schema. A query below one of their roots is forwarded
 // to the daemon's session, all its nodes in one request, after the list of state nodes as registration nodes.
@@ -223,7 +223,7 @@ bn_request_msg *make_forwarded(const state_source &source, const std::vector<ask
     return msg.take();
 }
 
-// Asks the daemon of the current part for these nodes. Gives LC_OK when the query waits for the answer.
+// Asks the daemon of the current part for these nodes. Returns LC_OK when the query waits for the answer.
 uint32_t forward_query(server *self, const std::vector<asked_node> &nodes, bool list_groups,
                        pending_query query) {
     query.bytes = 0;
@@ -352,7 +352,7 @@ bool gather_answer(server *self, pending_query *query, bn_response_msg *msg, siz
     bn_response_msg *made = nullptr;
     if (self->gathered_bytes + query->gathered_bytes > GATHERED_BYTES_MAX ||
         (!query->gathered && bn_query_response_msg_create(&made, 0, 0, nullptr) != LC_OK)) {
-        refuse_query(self, *query, LC_NO_SPACE, "Too many large answers wait: ask for less, or later");
+        refuse_query(self, *query, LC_NO_SPACE, "Too many large answers are waiting: ask for less, or later");
         return false;
     }
     if (made)
@@ -379,7 +379,7 @@ bool gather_answer(server *self, pending_query *query, bn_response_msg *msg, siz
 void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg, size_t bytes) {
     const auto found = self->pending.find(msg->response_to);
     if (found == self->pending.end() || found->second.provider != peer_id)
-        return; // the query has timed out, or was asked of another session
+        return; // the query has timed out, or was sent to another session
     pending_query query = server_take_pending(self, found);
     if (!gather_answer(self, &query, msg, bytes))
         return;

@@ -6,10 +6,10 @@
 //
 // Other nodes below /qv/alarms/state are in left_groups.cpp, drains.cpp and processes.cpp.
 //
-// TYPE is the number of the alarm, SOURCE is what it is about. A repeated report replaces the one before.
-// Daemons do not resend alarms and roles. When a session ends, those that it reported are forgotten, because
-// nobody watches the condition any more: the alarm counts as cleared, and the role is UNKNOWN. Each report,
-// and each that is forgotten, is sent as an event to the sessions with an interest in it.
+// TYPE is the number of the alarm, SOURCE its subject. A repeated report replaces the one before. Daemons do
+// not resend alarms and roles. When a session ends, those that it reported are forgotten, because nobody
+// watches the condition any more: the alarm counts as cleared, and the role is UNKNOWN. Each report, and each
+// that is forgotten, is sent as an event to the sessions with an interest in it.
 #include <ctime>
 
 #include "mgmt/node_paths.h"

@@ -37,7 +37,7 @@ bool is_multicast(uint32_t address) {
     return address >> 28 == 0xe;
 }
 
-// Why the address cannot belong to a router; null: it can.
+// The reason why the address cannot belong to a router; null: it can.
 const char *find_fault(uint32_t address, size_t routers, const std::vector<local_address> &local) {
     if (is_multicast(address))
         return routers > 1 ? "is a multicast address, which must be the only router of its group" : nullptr;

@@ -113,7 +113,7 @@ struct group_overlay {
 struct commit_order {
     std::string who;                   // for the log
     std::string user = {}, cause = {}; // for the history
-    bool check_only = false;           // only check whether it would be taken
+    bool check_only = false;           // only check whether it would be accepted
     uint32_t revision = 0;             // refuse it if the configuration has another revision; 0: any
     uint32_t confirm_minutes = 0;      // undo it unless it is confirmed within this time; 0: it stays
     bool ends_wait = false; // also while another commit waits to be confirmed, which then counts as settled
@@ -160,8 +160,8 @@ void server_peer_opened(server *self, uint32_t peer_id, const std::string &name,
 void server_peer_closed(server *self, uint32_t peer_id);
 // Handles a complete frame of protocol 2. False: it could not be read, and the session has to be ended.
 bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame);
-// Does what is due by the clock: queries that time out, drains, bypasses, unconfirmed commits. Gives the time
-// of the next thing to do, or -1.
+// Does the work that is due: queries that time out, drains, bypasses, unconfirmed commits. Returns the time
+// of the next such work, or -1.
 int64_t server_tick(server *self);
 
 void server_send_event(server *self, const std::string &event, const std::vector<event_field> &fields);
@@ -172,8 +172,8 @@ commit_result server_commit(server *self, const std::vector<set_step> &steps, co
 // Reads the configuration file. False with its errors. A file without errors may have warnings. Both are
 // lines.
 bool server_load(server *self, std::string *out_errors, std::string *out_warnings);
-// To be called before the first session, and after the lock against a second mgmtd is held: removes what an
-// interrupted commit has left, opens the history, and writes the facility file.
+// To be called before the first session, and after the lock against a second mgmtd is held: removes the
+// leftovers of an interrupted commit, opens the history, and writes the facility file.
 void server_begin(server *self);
 // Reads the configuration file again and commits the differences. A file with errors changes nothing.
 void server_reload(server *self);
@@ -190,7 +190,7 @@ bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, 
 void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg);
 // Removes a query from those that wait.
 pending_query server_take_pending(server *self, std::map<uint32_t, pending_query>::iterator at);
-// Goes on with a query whose daemon failed to answer.
+// Continues a query whose daemon failed to answer.
 void server_answer_without(server *self, pending_query query, uint32_t code, const std::string &why);
 void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg *msg, size_t bytes);
 void server_take_event(server *self, uint32_t peer_id, const std::string &event,
@@ -257,15 +257,15 @@ bool server_keep(server *self, const node_tree &next, const config_comments &com
 // changed then.
 bool server_save(server *self, const node_tree &next, const config_comments &comments,
                  const commit_order &order, commit_extent extent, std::string *out_reason);
-// Why no commit is taken now, because another one waits to be confirmed; "" if none waits.
+// The reason why no commit is accepted now: another one waits to be confirmed. "" if none waits.
 std::string server_wait_for_confirmation(const server *self);
 commit_result server_confirm(server *self, const std::string &who);
-// Undoes a commit that was not confirmed in time. Gives when to call it again, or -1.
+// Undoes a commit that was not confirmed in time. Returns when to call it again, or -1.
 int64_t server_return_unconfirmed(server *self);
 // Makes the text of a configuration, for a node that is in no walk. With `hide`, passwords are stars, and
 // comments are left out because they may contain passwords. False: no such node.
 bool server_config_text(const server *self, const node_name &name, bool hide, node_value *out);
 // Makes `next` the configuration and sends the change events.
 void server_take_over(server *self, node_tree next, const commit_result &commit);
-// Deletes bypasses whose time is over by a commit. Gives when to call it again, or -1.
+// Deletes expired bypasses by a commit. Returns when to call it again, or -1.
 int64_t server_expire_bypasses(server *self);

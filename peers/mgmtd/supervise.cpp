@@ -1,8 +1,8 @@
 // The end of a child is reported at once, and the child is started again after a delay. The delay doubles
-// with each end, from one second to thirty, and begins anew after a long run. wccpd exits by itself when it
-// hears of the end of tunneld, and is started again like any child. Children get default signal handling, an
-// empty signal mask, and SIGTERM if mgmtd dies before them, so that the next mgmtd finds none of them
-// running.
+// with each end, from one second to thirty, and starts over after a long run. wccpd exits when it receives
+// the report that tunneld has ended, and is started again like any child. Children get default signal
+// handling, an empty signal mask, and SIGTERM if mgmtd dies before them, so that the next mgmtd finds none of
+// them running.
 //
 // A child that takes over (tunneld) is different. If it crashes or fails after it has had a session, it is
 // started again at once, and its loss is reported only if the new process has no session in time: what the
@@ -33,7 +33,7 @@
 #include <unistd.h>
 
 extern "C" {
-#include <sys/pidfd.h> // glibc 2.36 doesn't say so itself
+#include <sys/pidfd.h> // without extern "C" of its own in glibc 2.36
 }
 
 #include "mgmt/node_paths.h"
@@ -256,7 +256,7 @@ bool supervisor_take_report(supervisor *self, const std::string &process) {
 
 namespace {
 
-// Reports the loss of a child that nobody has replaced in time. Gives when to call it again, or -1.
+// Reports the loss of a child that nobody has replaced in time. Returns when to call it again, or -1.
 int64_t report_loss(supervisor *self, child *process, int64_t now) {
     if (!process->loss)
         return -1;

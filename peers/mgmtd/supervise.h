@@ -70,7 +70,7 @@ void supervisor_session_closed(supervisor *self, const std::string &name);
 // itself.
 bool supervisor_take_report(supervisor *self, const std::string &process);
 // Starts the children that are due. When ending, ends them one after the other, the one that was started last
-// first. Gives the time of the next thing to do, or -1.
+// first. Returns the time of the next work, or -1.
 int64_t supervisor_tick(supervisor *self);
 bool supervisor_is_done(const supervisor &self); // no child runs
 // The event for a wait status.

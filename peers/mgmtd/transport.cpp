@@ -323,7 +323,7 @@ std::string name_of_user(uid_t uid) {
     return uid == 0 ? "root" : entry ? entry->pw_name : "user " + std::to_string(uid);
 }
 
-// Fills in the user of a connection. Gives why it is refused, or "".
+// Fills in the user of a connection. Returns why it is refused, or "".
 std::string identify_client(const transport *self, int fd, session *out) {
     ucred who{};
     socklen_t length = sizeof who;
@@ -383,7 +383,7 @@ void remove_ended_sessions(transport *self) {
     }
 }
 
-// Does what is due by the clock. Gives the time until the next, `timeout_ms` at most (-1: no limit).
+// Does the work that is due. Returns the time until the next, `timeout_ms` at most (-1: no limit).
 int64_t run_timers(transport *self, int64_t timeout_ms) {
     const int64_t now = self->owner->now_ms();
     if (now >= self->check_place_at_ms) {

@@ -6,7 +6,7 @@
 //   /qv/wccpd/system/config/mcast_ttl = 4    a name from the root
 //
 // The section of an instance makes the instance, even without lines, and the instances that it belongs to.
-// Blanks around a value are not part of it. In quotes, \" and \\ stand for the characters. Only values that
+// Blanks around a value are not part of it. In quotes, \" and \\ are the escaped characters. Only values that
 // were set are written, never defaults.
 #include "peers/nodes/config_text.h"
 
@@ -107,7 +107,7 @@ bool take_section(parser *state, const std::string &line, std::string *out_reaso
         if (above.parts.size() < name.parts.size())
             continue;
         above.parts.resize(name.parts.size());
-        known = known || matches(above, name);
+        known = known || matches_pattern(above, name);
     }
     if (!known) {
         *out_reason = "nothing can be set below " + shown_text(name.text());
@@ -129,7 +129,8 @@ bool take_value(parser *state, const std::string &line, std::string *out_reason)
     }
     std::string name_text = trim_blanks(line.substr(0, equals)), value;
     if (name_text.empty() || (name_text[0] != '/' && state->section.empty())) {
-        *out_reason = "\"" + shown_text(name_text) + "\" is no name from the root, and it is in no section";
+        *out_reason =
+            "\"" + shown_text(name_text) + "\" is not a name from the root, and it is in no section";
         return false;
     }
     if (name_text[0] != '/')

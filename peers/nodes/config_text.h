@@ -26,7 +26,7 @@ struct config_text {
 bool config_parse(const std::string &content, const std::string &file, config_text *out);
 bool config_parse_part(const std::string &content, const std::string &file, config_text *out);
 std::string config_format(const node_tree &tree, const config_comments &comments);
-// Gives "FILE:LINE: REASON" and a newline. The reason begins with the name of a node and ": ", which gives
+// Returns "FILE:LINE: REASON" and a newline. The reason begins with the name of a node and ": ", which gives
 // the line.
 std::string config_complaint(const std::string &file, const std::map<node_name, int> &lines,
                              const std::string &reason);

@@ -64,7 +64,7 @@ void tree_refresh(node_tree *tree) {
         const std::string last = above.parts.back();
         above.parts.pop_back();
         for (const node_name &instance : instances)
-            if (matches(above, instance))
+            if (matches_pattern(above, instance))
                 tree->nodes.emplace(instance.below(last), node_value{row.type, row.fallback});
     }
 }
@@ -98,7 +98,7 @@ bool check_routers(const node_tree &tree, const node_name &group, std::string *o
         }
         if (*address == "0.0.0.0" || !seen.insert(*address).second) {
             *out_reason = name.text() + "/ipaddr: " + *address +
-                          (*address == "0.0.0.0" ? " is no router's address" : " is given twice");
+                          (*address == "0.0.0.0" ? " is not the address of a router" : " is given twice");
             return false;
         }
     }
@@ -252,7 +252,7 @@ commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &s
     for (const set_step &step : steps) {
         node_name name;
         if (!parse_node_name(step.name, &name))
-            return refuse_step(LC_BAD_PATH, step.name, "is no absolute node name");
+            return refuse_step(LC_BAD_PATH, step.name, "is not an absolute node name");
         const schema_row *row = find_schema_row(name);
         if (!row)
             return refuse_step(LC_NOT_FOUND, step.name, "there is no such node in the configuration");
@@ -270,7 +270,7 @@ commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &s
 
 bool tree_check_change(const node_tree &before, const node_tree &after, std::string *out_reason) {
     for (const auto &[name, value] : after.nodes) {
-        if (!matches(policy_membership, name))
+        if (!matches_pattern(policy_membership, name))
             continue;
         const node_name policy = policy_groups.below(value.text);
         if (!before.nodes.contains(policy) || after.nodes.contains(policy))

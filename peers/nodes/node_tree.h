@@ -52,7 +52,7 @@ struct commit_result {
 
 std::vector<node_change> tree_difference(const node_map &before, const node_map &after);
 
-// Applies the steps to a copy of the tree. If one of them is refused, so are all.
+// Applies the steps to a copy of the tree. If one of them is refused, none is applied.
 commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &steps, node_tree *out_next);
 // Checks that need the tree before the change. False with the reason.
 bool tree_check_change(const node_tree &before, const node_tree &after, std::string *out_reason);

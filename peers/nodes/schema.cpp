@@ -32,7 +32,7 @@ const char *check_level(std::string *inout) {
     for (const lc_enum_entry *entry = lc_log_level_table; entry->name; entry++)
         if (text == entry->name)
             level = 1;
-    return level || text.empty() ? nullptr : "is no log level (emerg to debug)";
+    return level || text.empty() ? nullptr : "is not a log level (emerg to debug)";
 }
 
 const char *check_facility(std::string *inout) {
@@ -40,7 +40,7 @@ const char *check_facility(std::string *inout) {
     for (const lc_enum_entry *entry = lc_log_facility_table; entry->name; entry++)
         if (text == std::to_string(entry->value))
             return nullptr;
-    return "is no log facility (a multiple of 8 up to 184)";
+    return "is not a log facility (a multiple of 8 up to 184)";
 }
 
 const char *check_protocol(std::string *inout) {
@@ -51,13 +51,14 @@ const char *check_protocol(std::string *inout) {
                                                                                : nullptr;
     const int number = ip_protocol_by_name(text.c_str());
     if (number == 0)
-        return "is no protocol of its own; name one that is carried in it";
-    return number < 0 ? "is no protocol; give a name such as tcp or udp, or a number from 1 to 255" : nullptr;
+        return "is not a protocol of its own; name one that is carried in it";
+    return number < 0 ? "is not a protocol; give a name such as tcp or udp, or a number from 1 to 255"
+                      : nullptr;
 }
 
 const char *check_interface(std::string *inout) {
     const std::string &text = *inout;
-    return text.find_first_of("/ \t:") == std::string::npos ? nullptr : "is no interface name";
+    return text.find_first_of("/ \t:") == std::string::npos ? nullptr : "is not an interface name";
 }
 
 const char *check_path(std::string *inout) {
@@ -321,7 +322,7 @@ node_name node_name::below(const std::string &part) const {
 
 namespace {
 
-// Of any name from outside. A peer may send names of millions of parts.
+// Limit for any name from outside. A peer may send names of millions of parts.
 constexpr uint32_t NAME_PARTS_MAX = 64;
 
 } // namespace
@@ -350,7 +351,7 @@ node_name parsed_name(const std::string &text) {
     return parse_node_name(text, &out) ? out : node_name{};
 }
 
-bool matches(const node_name &pattern, const node_name &name) {
+bool matches_pattern(const node_name &pattern, const node_name &name) {
     return pattern.parts.size() == name.parts.size() &&
            std::equal(pattern.parts.begin(), pattern.parts.end(), name.parts.begin(),
                       [](const std::string &wanted, const std::string &part) {
@@ -360,7 +361,7 @@ bool matches(const node_name &pattern, const node_name &name) {
 
 const schema_row *find_schema_row(const node_name &name) {
     for (const schema_row &row : rows)
-        if (matches(row.parts, name))
+        if (matches_pattern(row.parts, name))
             return &row;
     return nullptr;
 }
@@ -427,7 +428,7 @@ bool check_instance(const schema_row &row, const std::string &part, std::string 
     *out_reason = "\"" + shown_text(part) + "\" ";
     if (!canonical_text(row.type, part, &kept) || kept != part ||
         (numeric && (std::stoll(part) < row.min || std::stoll(part) > row.max))) {
-        std::string fault = "is no number between " + describe_range(row);
+        std::string fault = "is not a number between " + describe_range(row);
         for (const auto &[type, other] : other_instances)
             if (type == row.type)
                 fault = other;
@@ -441,7 +442,7 @@ bool check_instance(const schema_row &row, const std::string &part, std::string 
     return true;
 }
 
-// Refuses parts that the configuration file would not give back unchanged, or that nobody could see.
+// Refuses parts that the configuration file would not reproduce, and parts that would be invisible.
 bool check_part(const std::string &part, std::string *out_reason) {
     const auto is_control = [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == 0x7f; };
     const char *fault = nullptr;
@@ -471,7 +472,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
         if (!above.instance || depth > name.parts.size())
             continue;
         const node_name root = {{name.parts.begin(), name.parts.begin() + static_cast<ptrdiff_t>(depth)}};
-        if (matches(above.parts, root) && !check_instance(above, root.parts.back(), out_reason))
+        if (matches_pattern(above.parts, root) && !check_instance(above, root.parts.back(), out_reason))
             return false;
     }
     if (row.instance) {
@@ -484,7 +485,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
     const bool secret = name.parts.back() == "password";
     const std::string shown = secret ? "the password" : "\"" + shown_text(text) + "\"";
     if (!canonical_text(row.type, read_hexadecimal(row.type, text), out_text)) {
-        *out_reason = shown + " is no " + type_name(row.type);
+        *out_reason = shown + " is not a valid " + type_name(row.type);
         return false;
     }
     if (bn_type_string(row.type)) {
@@ -492,7 +493,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
         const bool printable = std::all_of(text.begin(), text.end(),
                                            [](char c) { return static_cast<unsigned char>(c) >= 0x20; });
         if (row.words && !is_one_of(row.words, text))
-            *out_reason = shown + " is none of " + row.words;
+            *out_reason = shown + " is not one of " + row.words;
         else if (!printable)
             *out_reason = shown + " has control characters";
         else if (length < row.min)

@@ -1,5 +1,5 @@
 // The nodes that a configuration may have: one row for each kind of node. In a pattern "*" is a part that the
-// operator chooses. mgmtd knows of a node what is in its row, and mgmtctl has its help from the same table.
+// operator chooses. mgmtd checks nodes by this table, and mgmtctl takes its help texts from it.
 #pragma once
 
 #include <compare>
@@ -41,7 +41,7 @@ const std::vector<schema_row> &schema();
 const std::vector<const char *> &wccpd_state_nodes();
 const std::vector<const char *> &tunneld_state_nodes();
 const schema_row *find_schema_row(const node_name &name); // null: there is no such node
-bool matches(const node_name &pattern, const node_name &name);
+bool matches_pattern(const node_name &pattern, const node_name &name);
 
 // A text from outside for use in a message: without control characters, and cut when it is long.
 std::string shown_text(const std::string &text);

@@ -59,7 +59,7 @@ const char *check_ports(std::string *inout) {
     for (const std::string &word : words) {
         number_range range = {};
         if (!parse_range(word, &range))
-            return "is no list of ports: write \"all\", or ports and ranges from 1 to 65535 such as 80 "
+            return "is not a list of ports: write \"all\", or ports and ranges from 1 to 65535 such as 80 "
                    "8000-8080";
         if (range.first > range.last)
             return "has a range whose first port is greater than its last";
@@ -86,7 +86,7 @@ const char *check_ports(std::string *inout) {
 namespace {
 
 const char *const NO_PREFIX = "is no IPv4 prefix such as 10.0.0.0/8";
-const char *const NO_PREFIXES = "is no list of IPv4 prefixes such as 10.0.0.0/8 192.0.2.1/32";
+const char *const NO_PREFIXES = "is not a list of IPv4 prefixes such as 10.0.0.0/8 192.0.2.1/32";
 const char *const HOST_BITS = "has host bits that are not zero; write the address of the network, "
                               "such as 10.0.0.0/8, or /32 for a host";
 

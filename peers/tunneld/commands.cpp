@@ -1,8 +1,8 @@
-// wccpd gives a command up after two seconds: it then withdraws an add, and overwrites a delete or an L2
-// return with its next command. Therefore a command is read a second time, to see that it was not overwritten
-// meanwhile, and compared once more before it is answered. A command that is gone by then gets no answer,
-// which wccpd would take for the answer to the next one, and an add that is gone is undone, since wccpd does
-// not know that the tunnel exists.
+// wccpd gives up on a command after two seconds: it then withdraws an add, and overwrites a delete or an L2
+// return with its next command. Therefore a command is read twice, to detect that it was overwritten
+// meanwhile, and compared once more before it is answered. A command that is gone by then is not answered,
+// because wccpd would take the answer for that of the next one; an add that is gone is undone, because wccpd
+// does not know that the tunnel exists.
 //
 // As in wccpd, a tunnel is identified by its two ends, and its id is only a handle. An add of known ends
 // under another id, or of other ends under a known id (its delete was lost), replaces the old tunnel.
@@ -87,7 +87,7 @@ bool is_still_pending(const mailbox_command &command) {
            wccp_get_tunnel_command() == command.code;
 }
 
-// False when wccpd has given the command up. It is not answered then.
+// False when wccpd has given up on the command, which is then not answered.
 bool answer_command(const mailbox_command &given, uint32_t index, uint32_t status) {
     if (!is_still_pending(given))
         return false;
@@ -203,7 +203,7 @@ void watch_wccpd(command_desk *desk, int64_t now_ms) {
     if (before == 0 ||
         desk->tunnels.empty()) // 0: whether wccpd is new is unknown, and the tunnels may be in use
         return;
-    LC_LOG(LC_LOG_NOTICE, "wccpd has been started anew: %zu tunnels wait to be ordered again",
+    LC_LOG(LC_LOG_NOTICE, "A new wccpd has been started: %zu tunnels wait to be ordered again",
            desk->tunnels.size());
     desk->unordered_until_ms = now_ms + UNORDERED_MS;
 }

@@ -64,8 +64,8 @@ struct command_desk {
 
 // False, with a line in the log, when shared memory cannot be used.
 bool start_commands(command_desk *desk, const command_options &options, FILE *out);
-// Executes and answers the pending command. False when there is none. `out_end`: a signal has interrupted the
-// command, which happens only with `slow_ms`.
+// Executes and answers the pending command. False when there is none, and with `silent`. `out_end`: a signal
+// has interrupted the command, which happens only with `slow_ms`.
 bool take_command(command_desk *desk, bool *out_end);
 // Notices that a new wccpd has been started. To be called about once a second; take_command() also does it,
 // because the first command of a new wccpd can come before that.

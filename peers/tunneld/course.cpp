@@ -15,7 +15,7 @@ bool is_group_empty(course *self, const course_facts &facts) {
     }
     if (self->draining_ms < 0)
         self->draining_ms = facts.now_ms;
-    // Before the routers have the table without this appliance, new flows still come. Without other
+    // Until the routers have the table without this appliance, new flows still arrive. Without other
     // appliances the table does not change.
     const bool moved =
         facts.left || facts.alone || !facts.active || facts.now_ms - self->draining_ms >= TABLE_CHANGE_MS;

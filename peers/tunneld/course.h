@@ -7,7 +7,7 @@
 
 // How long after a change of the weight the routers have the table that results from it: two announcements.
 constexpr int64_t TABLE_CHANGE_MS = 20000;
-// How long routers keep an appliance that is silent. A wccpd that is restarted within this time does not
+// How long routers keep an appliance that sends nothing. A wccpd that is restarted within this time does not
 // begin a slow start.
 constexpr int64_t ROUTER_PATIENCE_MS = 30000;
 constexpr uint32_t SLOW_START_STEPS = 5; // of equal size

@@ -68,7 +68,7 @@ bool send_socket_query(int fd, uint8_t family) {
     return send(fd, &request, sizeof request, 0) == static_cast<ssize_t>(sizeof request);
 }
 
-// The kernel makes each part of the answer when it is read, therefore the reads need not block. Returns 0 or
+// The kernel makes each part of the answer when it is read; therefore the reads need not block. Returns 0 or
 // an errno.
 int read_socket_list(int fd, const std::vector<uint32_t> &own, std::vector<flow_ends> *out) {
     const std::unique_ptr<char[]> bytes(new char[ANSWER_BYTES]);

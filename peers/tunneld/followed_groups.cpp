@@ -56,7 +56,7 @@ void report_overload(tunneld *daemon, uint8_t id, followed_group *group, uint32_
     group->reported_overload = group->decided.overloaded;
     const std::string text = "group " + std::to_string(id) + ": " + std::to_string(group->flows) +
                              " flows, the limit is " + std::to_string(limit);
-    LC_LOG(LC_LOG_NOTICE, "New flows are %s: %s", group->decided.overloaded ? "returned" : "taken again",
+    LC_LOG(LC_LOG_NOTICE, "New flows are %s: %s", group->decided.overloaded ? "returned" : "accepted again",
            text.c_str());
     mgmt_link_overload(daemon->management, id, group->decided.overloaded, text);
 }
@@ -79,7 +79,7 @@ void report_decisions(tunneld *daemon, uint8_t id, followed_group *group) {
     }
 }
 
-// Adds and drops groups as the configuration changes. What was reported of a dropped group is taken back.
+// Adds and drops groups as the configuration changes. What was reported for a dropped group is withdrawn.
 void update_followed_groups(tunneld *daemon) {
     const configured_view &view = daemon->configured;
     for (auto at = daemon->followed.begin(); at != daemon->followed.end();) {

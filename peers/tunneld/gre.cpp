@@ -6,7 +6,7 @@
 
 namespace {
 
-// Distinguishes a packet from a redirect header, whose first byte never has a bit but 0x80 and 0x40.
+// Distinguishes a packet from a redirect header, whose first byte has no bits set but 0x80 and 0x40.
 bool looks_like_ip4(const uint8_t *bytes, size_t length) {
     if (length < sizeof(ip4_wire_header))
         return false;

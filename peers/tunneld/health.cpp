@@ -25,7 +25,7 @@
 #include <unistd.h>
 
 extern "C" {
-#include <sys/pidfd.h> // glibc 2.36 doesn't say so itself
+#include <sys/pidfd.h> // without extern "C" of its own in glibc 2.36
 }
 
 #include "runtime/logging.h"

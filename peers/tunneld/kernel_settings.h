@@ -1,4 +1,4 @@
-// Settings of interfaces, below /proc/sys/net/ipv4/conf. The values from before are kept in a state file, so
+// Settings of interfaces, below /proc/sys/net/ipv4/conf. The previous values are kept in a state file, so
 // that the next tunneld can restore them when this one is killed.
 #pragma once
 
@@ -9,7 +9,7 @@
 
 // Writes the settings that differ. Where a setting of `all` is lowered, the other interfaces and `default`
 // are raised to the old value of `all`: for an interface, the larger of its own value and that of `all`
-// counts. Goes on after a failure and returns the first one.
+// counts. Continues after a failure and returns the first one.
 bool apply_settings(const std::vector<wanted_setting> &wanted, std::string *out_error);
 // Restores the settings that are no longer wanted, except those that somebody else has changed since. Removes
 // the state file when nothing is left in it.

@@ -12,8 +12,8 @@
 std::vector<wanted_link> find_own_links();
 
 // Brings the kernel to the wanted state: links first, then routes and rules, the sorting rules last; objects
-// that are no longer wanted are removed in the opposite order. Goes on after a failure and returns the first
-// one; the next call tries the rest again. `out_indices`: interface indices of the existing links.
+// that are no longer wanted are removed in the opposite order. Continues after a failure and returns the
+// first one; the next call tries the rest again. `out_indices`: interface indices of the existing links.
 bool reconcile_kernel_state(const data_plane &plane, const wanted_state &wanted,
                             std::map<std::string, uint32_t> *out_indices, std::string *out_error);
 // For the time before the configuration is known: adds and removes only links with their own routes and

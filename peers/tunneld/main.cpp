@@ -16,12 +16,12 @@ int main(int argc, char **argv) {
         ->check(CLI::IsMember({"auto", "kernel", "user", "table"}))
         ->capture_default_str();
     app.add_flag("--return-redirect", user_plane_settings.redirect_header,
-                 "packets go back to the routers with their redirect header; user-space data plane only");
+                 "return packets to the routers with their redirect header; user-space data plane only");
     app.add_flag("--json", options.commands.json, "one JSON object for each command");
     app.add_flag("--roles", options.commands.roles, "print changes of policy group roles as well");
-    app.add_option("--slow", options.commands.slow_ms, "take so many milliseconds for each command");
+    app.add_option("--slow", options.commands.slow_ms, "delay each command by this many milliseconds");
     app.add_flag("--refuse", options.commands.refuse, "answer every command with a failure");
-    app.add_flag("--silent", options.commands.silent, "answer no command");
+    app.add_flag("--silent", options.commands.silent, "don't answer commands");
     app.add_option("--index", options.commands.first_index,
                    "index of the first tunnel with --plane table; 4294967295 gives none, which makes an add "
                    "fail");

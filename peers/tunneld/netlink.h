@@ -22,7 +22,7 @@ netlink_message make_netlink_message(int type, int flags, const void *header, si
 int change_kernel(nl_msg *message);
 // Sends a query (NLM_F_DUMP for a whole table, NLM_F_ACK for one object) and calls `each` with each answer;
 // `each` must not send requests. Calls `restart` before the first answer, and again when the table has
-// changed while it was read and is read anew.
+// changed while it was read and is read again.
 int query_kernel(nl_msg *message, const std::function<void(nlmsghdr *answer)> &each,
                  const std::function<void()> &restart);
 

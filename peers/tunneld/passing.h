@@ -1,6 +1,6 @@
 // Selects the packets that the data plane `user` passes on to another appliance by the bucket in their
-// redirect header: TCP packets that do not begin a flow. Whether this host has their flow after all is found
-// out by the kernel: they are written to an interface of kind `passing`, whose rules look for a socket first.
+// redirect header: TCP packets that do not begin a flow. The kernel decides whether this host has their flow
+// after all: they are written to an interface of kind `passing`, whose rules look for a socket first.
 #pragma once
 
 #include <bitset>

@@ -14,9 +14,9 @@
 constexpr const char *OWNERS_FILE = "/run/tunneld/owners";
 constexpr const char *PASSING_FILE = "/run/tunneld/passing";
 
-// Load what an earlier tunneld has saved; a missing or damaged file is an empty table. The passing table is
-// that of the data plane `user`: with the plane `kernel`, the rules in the kernel outlive the process by
-// themselves.
+// Load the file that an earlier tunneld has saved; a missing or damaged file is an empty table. The passing
+// table is that of the data plane `user`: with the plane `kernel`, the rules in the kernel outlive the
+// process by themselves.
 owners_table load_owners();
 passing_table load_passing();
 void save_passing(const passing_table &table);

@@ -229,13 +229,13 @@ state_tree build_state_tree(const std::vector<state_node> &nodes) {
     return out;
 }
 
-// A node that stands for one of many has no value of its own: the value is the last part of its name.
+// A node that is one of many instances has no value of its own: its value is the last part of its name.
 bool is_one_of_many(const node_name &name) {
     static const node_name patterns[] = {
         parsed_name(NODE_TUNNEL_STATE "/*"), parsed_name(NODE_INTERCEPT_STATE "/*"),
         parsed_name(NODE_PROTECTION_STATE "/group/*"), parsed_name(NODE_PROTECTION_STATE "/member/*")};
     return std::any_of(std::begin(patterns), std::end(patterns),
-                       [&](const node_name &pattern) { return matches(pattern, name); });
+                       [&](const node_name &pattern) { return matches_pattern(pattern, name); });
 }
 
 lc_status get_state(const char *name, const tstr_array *, void *data, bn_binding_array *out) {
@@ -287,7 +287,7 @@ void drop_session(mgmt_link *link) {
     link->connect_at_ms = lt_monotonic_ms() + RETRY_MS;
 }
 
-// Logs nothing: while mgmtd is not there, this is tried every second.
+// Logs nothing, because it is tried every second while mgmtd is not running.
 void connect_quietly(mgmt_link *link) {
     link->connect_at_ms = lt_monotonic_ms() + RETRY_MS;
     if (access(provider_path().c_str(), W_OK) != 0)

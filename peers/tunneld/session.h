@@ -1,5 +1,5 @@
 // The session with mgmtd: reads the configuration and follows its changes, answers queries about tunneld's
-// state, and sends reports. While there is no session, tunneld goes on with the last known configuration.
+// state, and sends reports. While there is no session, tunneld continues with the last known configuration.
 #pragma once
 
 #include <cstdint>

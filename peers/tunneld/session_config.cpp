@@ -259,7 +259,7 @@ void read_accepted(reading *self, const std::string &instance, const std::string
         self->complain("accepted sources after the first " + std::to_string(ACCEPTED_MAX) + " ignored");
 }
 
-// The node has no instance: its own name comes in place of one.
+// The node has no instance: its own name is used instead.
 void read_protection(reading *self, const std::string &leaf, const std::string &, const std::string &text) {
     if (leaf == "time" && !take_number(text, 0, 86400, &self->view.protection_s))
         self->complain("protection: time \"" + shown_text(text) + "\" ignored");

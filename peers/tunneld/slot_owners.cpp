@@ -109,7 +109,8 @@ namespace {
 void replace_owner(slot_history *slot, uint32_t owner, int64_t now_s) {
     if (owner == 0 || owner == slot->owner) // 0: the flows are still with the appliance that had the slot
         return;
-    // An owner in the first report counts as owner since ever, since nothing is known about the time before.
+    // An owner in the first report counts as having always been the owner: nothing is known about the time
+    // before.
     if (slot->owner != 0 && slot->since_s < now_s)
         slot->former.insert(slot->former.begin(), {slot->owner, slot->since_s, now_s});
     slot->since_s = slot->owner == 0 ? 0 : now_s;

@@ -50,7 +50,7 @@ bool is_safe_name(const std::string &name) {
     });
 }
 
-// An interval set refuses a prefix that lies within another: such ones are left out.
+// An interval set refuses a prefix that lies within another; such prefixes are left out.
 std::set<std::string> merge_prefixes(std::vector<ip_prefix> prefixes) {
     const auto mask = [](uint8_t length) { return length == 0 ? 0 : ~0u << (32 - length); };
     for (ip_prefix &prefix : prefixes)

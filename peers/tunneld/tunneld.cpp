@@ -7,7 +7,7 @@
 //
 // A killed tunneld leaves its interfaces, routes and rules, and the next one takes them over. Until that one
 // has read the configuration, however long this takes, it executes the commands that add and delete tunnels
-// but leaves the sorting rules as they are. Flows that are being served therefore go on.
+// but leaves the sorting rules as they are. Flows that are being served therefore continue.
 #include "peers/tunneld/tunneld.h"
 
 #include <arpa/inet.h>
@@ -211,7 +211,7 @@ void follow_health(tunneld *daemon) {
         }
         outage &down = daemon->outages.try_emplace(group, outage{now, false}).first->second;
         if (down.left && rules.leave_after_s == 0) {
-            LC_LOG(LC_LOG_NOTICE, "Group %d joins its routers again: it is no longer to leave them", group);
+            LC_LOG(LC_LOG_NOTICE, "Group %d joins its routers again: its leave time is 0 now", group);
             mgmt_link_group_joins(daemon->management, group);
             down = {now, false};
         }
@@ -292,7 +292,7 @@ void take_owners_text(tunneld *daemon, uint8_t group, const std::string &text) {
 }
 
 // The roles that a killed wccpd has reported are no longer valid. Until the next wccpd reports that a group
-// is ACTIVE, its new flows are returned and its existing flows go on.
+// is ACTIVE, its new flows are returned and its existing flows continue.
 void forget_old_roles(tunneld *daemon) {
     const command_desk &desk = daemon->desk;
     if (desk.wccpd_lives && desk.wccpd_pid == daemon->roles_of_pid)
@@ -458,7 +458,8 @@ void take_over_kernel_state(tunneld *daemon) {
 void start_plane(tunneld *daemon) {
     daemon->lack = probe_sorting_rules();
     if (!daemon->lack.empty())
-        LC_LOG(LC_LOG_ERR, "Packets cannot be sorted, therefore all are returned: %s", daemon->lack.c_str());
+        LC_LOG(LC_LOG_ERR, "Packets cannot be sorted, and all of them are returned: %s",
+               daemon->lack.c_str());
     daemon->desk.apply = [daemon](std::map<uint16_t, command_tunnel> *) { apply_tunnels(daemon); };
     daemon->desk.set_l2_return = [daemon](uint8_t group, bool forced) {
         daemon->forced_l2[group] = forced;

@@ -40,8 +40,8 @@ user_plane_options user_plane_settings;
 namespace {
 
 constexpr uint32_t RING_BATCH = 256; // packets that are taken from the ring at once
-// After a batch of so many packets more are on their way. Waiting for them once, instead of being woken for
-// every few, saves most of the processor time, and more segments can be merged. On a quiet line no packet
+// After a batch of this many packets, more are on their way. Waiting for them once, instead of being woken
+// for every few, saves most of the processor time, and more segments can be merged. On a quiet line no packet
 // waits.
 constexpr uint32_t BUSY_PACKETS = 8;
 constexpr timespec GATHER_TIME = {0, 200'000};

@@ -54,7 +54,7 @@ struct intercept_condition {
     bool operator==(const intercept_condition &) const = default;
 };
 
-// The negotiated way of packets between a router and this appliance; unknown until wccpd reports it.
+// How packets travel between a router and this appliance, as negotiated; unknown until wccpd reports it.
 enum class travel { unknown, gre, l2 };
 struct group_router {
     uint32_t id;      // router id: the router's end of the tunnel

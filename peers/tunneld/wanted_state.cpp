@@ -351,7 +351,7 @@ void want_groups(const appliance_view &view, const link_numbers &numbers, std::v
     }
 }
 
-// The way of packets that a member has passed on and that have no socket here: to a router of a group that
+// The path of packets that a member has passed on and that have no socket here: to a router of a group that
 // this appliance and the member belong to.
 std::optional<wanted_route> find_member_return(const appliance_view &view, const link_numbers &numbers,
                                                const tunnel_ends &member, const wanted_state &made) {

@@ -91,7 +91,7 @@ struct wanted_state {
 };
 
 // `before`: the links that were wanted last, or found at the start, whose numbers are kept. `user_space`: for
-// the plane `user`. `keep_members`: the view is not complete yet; links to other appliances that it does not
-// mention stay.
+// the plane `user`. `keep_members`: the view is not complete yet; links to other appliances that are missing
+// from it stay.
 wanted_state make_wanted_state(const appliance_view &view, const std::vector<wanted_link> &before,
                                bool user_space, bool keep_members = false);
