@@ -2,7 +2,7 @@
 // run eight times as fast.
 //
 // Clocks that count from boot run faster, and sleeps and the timeouts of poll and epoll_wait are shorter
-// accordingly. All programs multiply the same clock, therefore they agree on the time. Two things keep real
+// accordingly. All programs multiply the same clock; therefore they agree on the time. Two things keep real
 // time, because they concern work and not the protocol: the time of day, which timeouts of sessions with
 // mgmtd and log lines use; and waits of up to LEAST_WAIT, which some programs repeat a fixed number of times
 // while another process works.

@@ -63,7 +63,7 @@
 #               wccp_router (lab/fast_clock.cpp). mgmtd and mgmtctl, whose time limits concern work and not the protocol,
 #               keep real time. SECONDS of all functions are real seconds, except for lab_sleep.
 #   LAB_PATIENCE    by how much the SECONDS of functions that wait are multiplied (default 1), for a slow or busy machine.
-#                   What a test measures itself stays as it is.
+#                   Times that a test itself measures do not change.
 #   LAB_TUNNELD     options that lab_appliance_start passes to tunneld; "none": do not start it
 #   LAB_PLANE       its data plane (default table, which carries no packets); empty: the best that the kernel supports
 #   LAB_LOG_LEVEL   log level of wccpd in the configuration that lab_write_config writes (default info)
@@ -132,7 +132,7 @@ END
     echo 1 >/proc/sys/net/ipv6/conf/default/disable_ipv6 2>/dev/null
 }
 
-# Waits like sleep, but without a process: with many labs at a time, those that wait take little from those that work.
+# Waits like sleep, but without a process: with many labs at a time, waiting ones cost the others little.
 lab_pause() { # SECONDS
     read -rt "$1" <>"$LAB/pause" || true
 }
@@ -183,8 +183,8 @@ lab_bare() { # NODE
     LAB_INIT[$1]=$! LAB_BARE[$1]=yes
     lab_wait_namespace "${LAB_INIT[$1]}" net
 }
-# Routes packets that come in on interface X into the router's device to-X. What the router writes back into to-X comes
-# in on that device, and therefore follows the main table.
+# Routes packets that arrive on interface X into the router's device to-X. Packets that the router writes back into to-X
+# arrive on that device, and therefore follow the main table.
 lab_redirect() { # ROUTER
     # shellcheck disable=SC2016
     lab_in "$1" bash -c '
@@ -585,9 +585,9 @@ lab_tunneld_state() { # NODE KIND
     lab_tree "$1" "/qv/tunneld/$2/state"
 }
 
-# Prints what is left in an appliance: processes, shared memory, semaphores, sockets, interfaces, files. Left out is what
-# stays by design: the registry of shared memory with its semaphore, the tunnel mailbox if no process has it attached, and
-# the pid file.
+# Prints what is left in an appliance: processes, shared memory, semaphores, sockets, interfaces, files. Not printed is
+# what stays by design: the registry of shared memory with its semaphore, the tunnel mailbox if no process has it
+# attached, and the pid file.
 lab_remains() { # NODE
     lab_in "$1" bash -c '
         for own in /proc/[0-9]*; do

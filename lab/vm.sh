@@ -1,12 +1,12 @@
 #!/bin/bash
 # vm.sh [CASE...] | vm.sh -- COMMAND...: boots Debian's own kernel in a virtual machine, with the project in /wccpd,
-# and runs there the cases that need what this machine's kernel may not have (lab/vm/cases.sh), or a command.
+# and runs there the cases that need features which this machine's kernel may lack (lab/vm/cases.sh), or a command.
 #
-# Takes no privileges and mounts nothing: packages come from where the host's apt gets its own and are unpacked below
+# Needs no privileges and mounts nothing: packages come from where the host's apt gets its own and are unpacked below
 # build/vm, mke2fs writes the file systems, debugfs reads back what the machine has written. The machine has no network
 # device, and it ends with this script, whatever ends that. Below build/vm:
 #   debs, root-*    packages, and the file system and kernel made of them: kept for the next run
-#   run             of the last run: the project's disk, the console, and in results/ what the cases have left
+#   run             of the last run: the project's disk, the console, and in results/ the files of the cases
 #
 #   WCCP_BIN    where the programs are (default: build/release/bin)
 #   VM_LIMIT    seconds after which the machine is ended (default 330)
@@ -29,7 +29,7 @@ die() { echo "vm: $*" >&2; exit 1; }
 
 # ---- the root, made once for a set of packages
 
-# As if nothing were installed: what the packages need is resolved as well.
+# As if nothing were installed, so that all dependencies are resolved.
 apt_apart() {
     apt-get -q -y --no-install-recommends -o Dir::State::status="$vm/status" -o Dir::Cache::archives="$vm/debs" \
         -o Dir::Cache::pkgcache= -o Dir::Cache::srcpkgcache= -o Debug::NoLocking=1 -o APT::Sandbox::User=root "$@"
@@ -58,7 +58,7 @@ make_root() { # DIRECTORY : a file system in `root.img`, and `vmlinuz`
         dpkg-deb --fsys-tarfile "$vm/debs/$deb" | tar -C "$root" -x --no-same-owner --keep-directory-symlink \
             --exclude=./usr/share/{doc,man,locale,info} --exclude='./usr/*/perl*' || return
     done <<<"$debs"
-    # What the packages' own scripts would do, as far as it is needed here.
+    # The steps of the packages' own scripts that are needed here.
     mkdir -p "$root"/{media,mnt,opt,srv} "$root"/etc/opt "$root"/var/opt
     rm -rf "$root/var/run" && ln -s /run "$root/var/run"
     ln -s mawk "$root/usr/bin/awk"
@@ -94,7 +94,7 @@ update_lists() {
     $sudo apt-get -q update >"$vm/apt.log" 2>&1
 }
 
-# The project, as it would be in a checkout with a build, and what the machine is to do.
+# The project, as in a checkout with a build, and the command for the machine.
 prepare_project() { # ARGUMENTS...
     local tree=$run/project name
     rm -rf "$run"
@@ -152,14 +152,14 @@ boot() {
     : >"$run/console"
     start_machine "$VM_ACCEL"
 } 2>/dev/null
-# A machine that restarts ends, and is started anew: the reset of an emulated one does not always come back.
+# A machine that reboots exits and is started again: the reset of an emulated one does not always succeed.
 restart() {
     [ -z "$restarted" ] && grep -q 'reboot: Restarting system' "$run/console" || return
     restarted=yes
     wait "$machine" 2>/dev/null
     start_machine "$VM_ACCEL"
 }
-# Shows what the cases say as they say it.
+# Shows the output of the cases as it is written.
 watch() {
     local seen=0 now began=$SECONDS ended= restarted=
     until [ -n "$ended" ]; do

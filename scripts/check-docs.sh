@@ -1,6 +1,6 @@
 #!/bin/bash
-# check-docs.sh: checks that what the documents quote exists. Quotations are text in backticks, indented blocks and the
-# targets of links.
+# check-docs.sh: checks that everything quoted in the documents exists. Quotations are text in backticks, indented
+# blocks and the targets of links.
 #   Files     paths that begin with a directory of the tree, and bare names of source files and scripts
 #   mgmtctl   commands, against peers/mgmtctl/main.cpp; their words and options, against the strings in its sources.
 #             Each command has to be in docs/mgmtctl.md

@@ -2,11 +2,11 @@
 # demo.sh [--capture FILE] [--plain] [--speed N] [--no-build]
 # A client, a server, a router that redirects, and two appliances with a proxy each, in namespaces of their own. One
 # appliance joins, and downloads run through it. The other joins, and the designated one distributes 256 hash buckets by
-# weight: pages that the client fetches come through both proxies in these proportions, while the downloads go on. Then a
-# proxy is killed and started again; then its whole appliance dies. The fetches go on. On a terminal the demo shows what
-# it waits for, who has answered the last fetches, and below that `mgmtctl show --watch` of the appliance that survives.
-# Without a terminal it prints a line for each step. Takes some 75 seconds, installs and builds what is missing, and
-# leaves nothing running.
+# weight: pages that the client fetches come through both proxies in these proportions, while the downloads continue.
+# Then a proxy is killed and started again; then its whole appliance dies. The fetches continue. On a terminal the demo
+# shows what it waits for, who has answered the last fetches, and below that `mgmtctl show --watch` of the appliance
+# that survives. Without a terminal it prints a line for each step. Takes some 75 seconds, installs and builds what is
+# missing, and leaves nothing running.
 #   --capture FILE   write the packets of the protocol and of redirected flows to FILE, for tshark or wireshark
 #   --plain          print lines on a terminal as well
 #   --speed N        run the protocol N times as fast as real time (default 2)
@@ -77,7 +77,7 @@ fi
 lab_enter "$0" "${arguments[@]}"
 [ -n "$plain" ] || exec 2>&"$lines_fd"
 
-# --- Who takes part
+# --- The nodes
 
 declare -A address=([r1]=10.0.0.1 [a1]=10.0.0.101 [a2]=10.0.0.102) weight=([a1]=60 [a2]=100)
 survivor=a2
@@ -126,7 +126,7 @@ read_state() {
     seen=$(lab_manage $survivor show)
     fetch_pages 32 0.4
 }
-# Fetches a page from each of so many addresses of the client; `pages` becomes a line that says who answered.
+# Fetches a page from each of this many addresses of the client; `pages` becomes a line that shows who answered.
 fetch_pages() { # COUNT TIMEOUT
     fetched=$(lab_fetch c1 --count "$1" --sources "$1" --parallel "$1" --timeout "$2")
     pages=$(jq -r '(.fetched + .failed) as $all | def part: "\(.) (\(100 * . / $all | round)%)";

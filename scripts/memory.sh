@@ -1,5 +1,5 @@
 #!/bin/bash
-# memory.sh PID: resident and locked memory of a process by use, in kB. wccpd locks all of its memory, therefore each
+# memory.sh PID: resident and locked memory of a process by use, in kB. wccpd locks all of its memory; therefore each
 # mapped page counts, even if it is shared with other processes.
 #
 # Uses: the program and its libraries, with constants and the libraries' variables; stacks (those of threads are anonymous

@@ -3,7 +3,7 @@
 # writes only below build/.
 #   test.sh [STEP...]   only these steps, of: form release asan tsan tidy tidy-all fuzz package vm
 #
-#   form      format of the sources, includes between rooms, what the documents quote
+#   form      format of the sources, includes between rooms, quotations in the documents
 #   release   GCC: all tests and scenarios
 #   asan      clang with the address and undefined-behaviour sanitizers: all tests and scenarios; builds the fuzzers
 #   tsan      clang with the thread sanitizer: the tests that have threads
@@ -62,7 +62,7 @@ list_tidy_sources() { # changed|all
     fi; } | sed -n 's/\.h$/.cpp/; /\.cpp$/p' | grep -vE '^(tests|bench|fuzz)/' | awk '!seen[$0]++' |
         while read -r file; do [ ! -e "$file" ] || echo "$file"; done
 }
-# Files are analysed one at a time: clang-tidy 14 carries what it has seen of va_lists over from one file to the next.
+# Files are analysed one at a time: clang-tidy 14 carries its state of va_lists over from one file to the next.
 run_tidy() { # reads the names of the files
     cmake --preset asan -B build/tidy -DWCCP_PRECOMPILE=OFF -DWCCP_UNITY=OFF >build/tidy.log 2>&1 || { tail -n 20 build/tidy.log; return 1; }
     xargs -r -P "$jobs" -n 1 clang-tidy-14 --quiet -p build/tidy

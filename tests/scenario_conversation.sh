@@ -72,7 +72,7 @@ case_other_methods() {
     start_member a1 10.0.0.101 10.0.0.1 10.0.0.2 encap=l2
     wait_log a1 20 'incompatible capabilities \(router id 10\.0\.0\.1\) : local: \(fwd encap: L2 '
     group_is a1 20 60 "$ids == [\"10.0.0.2\"]"
-    # r1 is in no view, therefore neither the group nor the table waits for it.
+    # r1 is in no view; therefore neither the group nor the table waits for it.
     router_is r2 40 60 '$g.assignment.kind == "mask"'
     finish a1
 }

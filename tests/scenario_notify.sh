@@ -21,8 +21,8 @@ reported() { # SECONDS "KIND PREVIOUS>STATE REASON"...
     seen=$((seen + $#))
 }
 
-# The router falls silent and comes back, the proxy is killed and started again; then the service itself, wccpd and mgmtd
-# are gone for a time.
+# The router stops answering and comes back, the proxy is killed and started again; then the service itself, wccpd and
+# mgmtd are gone for a time.
 case_changes() {
     local seen=0
     lab_router r1 10.0.0.1

@@ -1,8 +1,8 @@
 #!/bin/bash
 # The Debian package on a system of its own: it is built, checked by lintian and installed under a systemd in namespaces.
-# The three programs run with few privileges, a group becomes active, and nobody's command is notified of it. Programs that
-# are killed or hang are restarted, with an alarm when that happens too often. An upgrade and a reboot keep the
-# configuration, and a purge leaves nothing.
+# The three programs run with few privileges, a group becomes active, and a command that runs as nobody is notified of
+# it. Programs that are killed or hang are restarted, with an alarm when that happens too often. An upgrade and a reboot
+# keep the configuration, and a purge leaves nothing.
 #   scenario_package.sh [DIRECTORY_OF_THE_PROGRAMS]    of wccp_router
 #
 #   WCCP_PACKAGE    a directory with a package that has been built already

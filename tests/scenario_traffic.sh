@@ -1,6 +1,6 @@
 #!/bin/bash
 # Redirected traffic: a client behind the router fetches pages from a server, the router redirects the packets by its
-# table, and the proxies of the appliances answer. Fetches go on whatever fails.
+# table, and the proxies of the appliances answer. Fetches succeed whatever fails.
 #   scenario_traffic.sh DIRECTORY_OF_THE_PROGRAMS [CASE...]
 #   LAB_KILLS   how often case_kills kills tunneld (default 5)
 set -u
@@ -10,7 +10,7 @@ export LAB_SPEED LAB_PLANE
 source "$(dirname "${BASH_SOURCE[0]}")/../lab/cases.sh"
 lab_cases "$@"
 
-# Creates router r1 between client c1, server s1 and the appliances. It redirects what comes from c1, by group 51.
+# Creates router r1 between client c1, server s1 and the appliances. It redirects packets from c1, by group 51.
 start_traffic() { # OPTIONS OF wccp_router...
     lab_router r1 10.0.0.1 -- --redirect c1=51 "$@"
     lab_client c1 r1
@@ -140,8 +140,8 @@ case_proxy_down() {
     finish a1
 }
 
-# New connections go to the server while established ones go on: with a limit, during a drain, and while wccpd is killed
-# and started again. The weight grows in steps, and the link is removed last.
+# New connections go to the server while established ones continue: with a limit, during a drain, and while wccpd is
+# killed and started again. The weight grows in steps, and the link is removed last.
 case_leaving() {
     start_traffic --forward gre --return gre
     local long drain

@@ -3,8 +3,8 @@
 //
 // Each redirecting interface NAME has a TUN device "to-NAME". The lab's routing rules send into it all
 // packets from NAME that the router would forward. Packets that are not redirected are written back into the
-// device, and the kernel routes them, because the rules do not apply to packets from to-NAME. So are packets
-// that appliances return in GRE. Packets returned by L2 are routed by the kernel directly.
+// device, and the kernel routes them, because the rules do not apply to packets from to-NAME. The same
+// happens to packets that appliances return in GRE. Packets returned by L2 are routed by the kernel directly.
 #pragma once
 
 #include <string>

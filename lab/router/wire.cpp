@@ -70,7 +70,7 @@ struct reader {
     uint8_t u8(const char *what) { return static_cast<uint8_t>(take(1, what)); }
     uint16_t u16(const char *what) { return static_cast<uint16_t>(take(2, what)); }
     uint32_t u32(const char *what) { return take(4, what); }
-    // The number of entries of `each` bytes; an error if so many do not fit into what is left.
+    // The number of entries of `each` bytes; an error if they do not fit into the remaining bytes.
     uint32_t count(size_t each, const char *what) {
         const uint32_t value = u32(what);
         if (missed.empty() && value > left / each)

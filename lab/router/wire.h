@@ -101,8 +101,8 @@ struct incoming {
     redirect_assign assign;
 };
 
-// Parses a message to a router that has this password ("": none). The result is empty, or says what is wrong
-// with the message.
+// Parses a message to a router that has this password ("": none). The result is empty, or describes the error
+// in the message.
 std::string read_message(const bytes &data, std::string_view password, incoming *message);
 
 struct view_element {

@@ -1,6 +1,6 @@
 #!/bin/bash
-# Of the kernel's data plane, what only a kernel with GRE shows and the cases of traffic do not: its speed beside plain
-# forwarding, the start with many tunnels and intercepts, the end of wccpd and of the whole machine.
+# Cases of the data plane `kernel`, for a kernel with GRE, that tests/scenario_traffic.sh does not have: its speed
+# compared with plain forwarding, the start with many tunnels and intercepts, the end of wccpd and of the whole machine.
 #   scenario.sh DIRECTORY_OF_THE_PROGRAMS [CASE...]
 
 figure() { # TEXT : a measured value, on the console and with the results
@@ -24,7 +24,7 @@ sink_by_gre() {
         ip rule add iif c1 preference 50 lookup 50
         ip rule add iif c1 to 10.0.0.0/24 preference 49 lookup main' || die "no GRE in the router"
 }
-# A server beside the appliance, to which the appliance forwards what the router sends it.
+# A server beside the appliance, to which the appliance forwards the router's packets.
 server_by_forwarding() {
     lab_bare s2 && lab_plug s2 "${LAB_INIT[s2]}" 10.0.0.50
     lab_gateway s2 10.0.0.101
@@ -39,7 +39,7 @@ server_by_forwarding() {
 median_of() { # VALUE... , rounded
     printf '%s\n' "$@" | jq -s 'sort | .[length / 2 | floor] * 100 | round / 100'
 }
-# Uploads as intercepted flows, beside the same ones forwarded by the appliance, and addressed to its socket.
+# Uploads as intercepted flows, compared with the same ones forwarded by the appliance, and addressed to its socket.
 case_throughput() {
     sink_by_gre
     server_by_forwarding
@@ -56,7 +56,7 @@ case_throughput() {
     figure "throughput by GRE to the proxy: $(median_of "${ratios[@]}") of plain forwarding," \
         "$(median_of "${direct[@]}") of delivery to a socket (medians of ${#ratios[@]} pairs)"
     [ "$(jq -n "$(median_of "${ratios[@]}") >= 0.9")" = true ] || die "too slow: ${ratios[*]}"
-    # All of it was carried, and none of it given back.
+    # All of it was delivered, and none of it returned.
     tunneld_is a1 10 tunnel ".[] | .bytes_in >= 300000000 and .packets_out == 0"
     finish a1
 }
@@ -80,7 +80,7 @@ case_large() {
 }
 
 # The life of an appliance: each form of GRE, a bypass, its proxy down and up again, each of its programs killed, and a
-# reboot. What is in the kernel is the same after each loss, and flows go on.
+# reboot. The state of the kernel is the same after each loss, and flows continue.
 case_life() {
     start_traffic --forward gre --return gre
     saved
@@ -169,8 +169,8 @@ kept_in_kernel() { # without what counts, and in no order: it depends on what wa
         nft list table ip tunneld 2>/dev/null | sed "s/packets [0-9]* bytes [0-9]*//" | sort'
 }
 
-# 32 tunnels, and an intercept for each of 256 groups: how long a tunneld takes after its start until all of it is in a
-# kernel from which rules and routes have gone. The links stay, as a killed tunneld leaves them.
+# 32 tunnels, and an intercept for each of 256 groups: how long a tunneld takes after its start to restore all rules and
+# routes. The links are already there, as a killed tunneld leaves them.
 case_many() {
     local i routers text='' LAB_LOG_LEVEL=notice
     lab_router r1 10.0.0.{1..32} -- --forward gre --return gre
@@ -195,13 +195,13 @@ case_many() {
     [ "$(lab_in a1 nft list table ip tunneld | grep -c 'tproxy to :')" = 256 ] || die "not all intercepts"
     [ $took -le 2000 ] || die "after $took ms"
 }
-# The rules come in one transaction: the last group's are looked for, since a list of all takes long.
+# The rules are added in one transaction: it is enough to find those of the last group. Listing all of them takes long.
 many_in_kernel() { # SECONDS
     lab_in a1 timeout "$1" bash -c '
         until [ "$(ip route show table all proto 204 | grep -c wccp)" = 32 ] &&
             nft list chain ip tunneld group/255 2>/dev/null | grep -q tproxy; do sleep 0.1; done' || die "not in the kernel"
 }
 
-# The cases use what those of traffic are made of.
+# The cases use the functions of tests/scenario_traffic.sh.
 # shellcheck source=../../tests/scenario_traffic.sh
 source "$(dirname "$0")/../../tests/scenario_traffic.sh"

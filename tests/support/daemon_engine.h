@@ -1,5 +1,5 @@
-// The engine for tests of the daemon, without threads, sockets or a session. Its interface is not ready, so
-// that groups exist and nothing is sent.
+// The engine for tests of the daemon, without threads, sockets or a session. Its interface is not ready:
+// groups exist, and nothing is sent.
 #pragma once
 
 #include <cstring>

@@ -32,8 +32,8 @@ void fresh_engine();
 void end_engine();
 // Waits up to three seconds for the kernel to see that a link has changed.
 bool link_becomes(const char *interface, uint32_t status);
-// The number of threads whose name begins so. Waits a moment, because a thread sets its name when it first
-// runs.
+// The number of threads whose name begins with this text. Waits a moment, because a thread sets its name when
+// it first runs.
 int threads_named(const std::string &name);
 
 // A packet as a receive thread passes it on. The address sanitizer catches an access after `length`.

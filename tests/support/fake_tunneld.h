@@ -1,4 +1,4 @@
-// tunneld's side of the mailbox, on a thread: records each command and answers as the test wants.
+// tunneld's side of the mailbox, on a thread: records each command and answers as the test requires.
 #pragma once
 
 #include <atomic>

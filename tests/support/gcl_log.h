@@ -1,4 +1,4 @@
-// Collects in the background what the process under test logs, with every level on. It owns /dev/log.
+// Collects in the background the log lines of the process under test, with every level on. It owns /dev/log.
 #pragma once
 
 #include <algorithm>
@@ -34,7 +34,8 @@ struct gcl_log {
         stop = true;
         reader.join();
     }
-    // Datagrams arrive in order: once the mark has been read, so has everything sent before it.
+    // Datagrams arrive in order: once the mark has been read, everything sent before it has been read as
+    // well.
     void settle() {
         sockaddr_un address = {AF_UNIX, "/dev/log"};
         const std::string mark = "mark " + std::to_string(++marks);

@@ -1,5 +1,5 @@
-// A client session without a loop, on the same thread as its provider: the test reads what it sends from the
-// provider, and deliver() passes it what the provider sends.
+// A client session without a loop, on the same thread as its provider: the test reads the session's output
+// from the provider, and deliver() passes the provider's output to it.
 #pragma once
 
 #include <thread>

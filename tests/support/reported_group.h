@@ -49,5 +49,5 @@ struct all_freed {
     ~all_freed();
 };
 
-// Calls the tick so many times.
+// Calls the tick this many times.
 void pass_seconds(uint32_t seconds);
