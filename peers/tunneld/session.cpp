@@ -112,10 +112,12 @@ bool send_queries(mgmt_link *link, uint32_t what, const std::vector<std::string>
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK)
         return false;
     for (const std::string &node : single_nodes)
-        if (bn_query_request_msg_append_str(msg.pointer, bn_query_get, 0, node.c_str(), nullptr) != LC_OK)
+        if (bn_query_request_msg_append_str(msg.pointer, bn_query_get, bn_qf_quiet, node.c_str(), nullptr) !=
+            LC_OK)
             return false;
     for (const std::string &name : names)
-        if (bn_query_request_msg_append_str(msg.pointer, what, flags, name.c_str(), nullptr) != LC_OK)
+        if (bn_query_request_msg_append_str(msg.pointer, what, flags | bn_qf_quiet, name.c_str(), nullptr) !=
+            LC_OK)
             return false;
     return send_request(link, msg.pointer, out);
 }
