@@ -304,7 +304,8 @@ browse
 switch_show off
 [ -z "$capture" ] || { lab_capture_end; chmod a+r "$capture"; print_line "packets: $capture"; }
 print_line "$survivor# mgmtctl show"
-if [ -n "$plain" ]; then exec {lines_fd}>&1; colour=''; else colour=--colour; fi
+if [ -n "$plain" ]; then exec {lines_fd}>&1; fi
+if [ -n "$plain${NO_COLOR-}" ]; then colour=''; else colour=--colour; fi
 # shellcheck disable=SC2086
 lab_in $survivor "$WCCP_BIN/mgmtctl" show $colour >&"$lines_fd" || lab_die "mgmtctl show failed"
 lab_end $survivor || lab_die "$survivor did not shut down cleanly"
