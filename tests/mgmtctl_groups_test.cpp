@@ -99,7 +99,7 @@ TEST(Groups, OneCommitWhereARunningGroupFollows) {
     EXPECT_EQ(mgmtd.run({"set", "51", "weight", "default"}).commits, 1);
     EXPECT_EQ(mgmtd.sent(0), "reset /weight=;");
     EXPECT_EQ(mgmtd.run({"set", "51", "encap", "l2", "assign", "mask", "weight", "8"}).note,
-              "a group that runs follows a change of assign, encap when it is started again: "
+              "a running group applies a change of assign, encap only when it is restarted: "
               "mgmtctl group restart 51");
 }
 

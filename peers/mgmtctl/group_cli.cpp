@@ -53,7 +53,7 @@ std::string result_text(const group_result &result) {
     else if (result.runs)
         text += "; state " + result.state + (result.designated ? ", designated" : "");
     else if (!result.wccpd.empty() && result.done != "deleted")
-        text += "; wccpd does not have it; its log has the reason";
+        text += "; wccpd does not have it: its log has the reason";
     return text;
 }
 

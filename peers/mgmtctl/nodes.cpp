@@ -310,8 +310,8 @@ std::string changed_word(const std::string &name, const std::string &root, group
 } // namespace
 
 std::string at_start_note(const std::string &words, const std::string &group) {
-    return "a group that runs follows a change of " + words +
-           " when it is started again: mgmtctl group restart " + group;
+    return "a running group applies a change of " + words +
+           " only when it is restarted: mgmtctl group restart " + group;
 }
 
 namespace {
