@@ -359,8 +359,29 @@ int wccp_set_grp_password(wccp_service_group *group, const wccp_grp_config *conf
     return 0;
 }
 
+// Once the group has agreed on methods with a router, it keeps them until it starts again.
+void note_kept_methods(wccp_service_group *group) {
+    const struct {
+        const char *what;
+        uint32_t used, configured;
+        const char *(*name)(uint32_t code);
+    } methods[] = {
+        {"forwarding", group->fwd_method, group->cfg_fwd_method, wccp_method_name},
+        {"assignment", group->assign_method, group->cfg_assign_method, wccp_assign_method_name},
+    };
+    for (const auto &method : methods)
+        if ((group->state_flags & WCCP_CAPABILITIES_SET) && !(method.used & method.configured)) {
+            wccp_note_reason(group, WCCP_REASON_RESTART_NEEDED, {},
+                             wccp_reason_value("%s by %s", method.what, method.name(method.used)),
+                             wccp_reason_value("%s", method.name(method.configured)));
+            return;
+        }
+    wccp_forget_reasons(group, WCCP_REASON_RESTART_NEEDED);
+}
+
 int wccp_set_fwd_method(wccp_service_group *group, const wccp_grp_config *config) {
     group->cfg_fwd_method = config->fwd_method;
+    note_kept_methods(group);
     return 0;
 }
 
@@ -371,6 +392,7 @@ int wccp_set_force_l2_rtn(wccp_service_group *group, const wccp_grp_config *conf
 
 int wccp_set_assign_method(wccp_service_group *group, const wccp_grp_config *config) {
     group->cfg_assign_method = config->assign_method;
+    note_kept_methods(group);
     return 0;
 }
 

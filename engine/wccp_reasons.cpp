@@ -68,6 +68,7 @@ constexpr code_row code_rows[] = {
     {"tunnel-ids-exhausted", ending::acceptance_or_time},
     {"tunneld-silent", ending::acceptance},
     {"mailbox-missing", ending::acceptance_or_time},
+    {"restart-needed", ending::step},
 };
 static_assert(sizeof code_rows / sizeof *code_rows == WCCP_REASON_CODES);
 

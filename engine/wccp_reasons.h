@@ -72,7 +72,8 @@ enum wccp_reason_code : uint8_t {
     WCCP_REASON_TUNNEL_IDS_EXHAUSTED,
     WCCP_REASON_TUNNELD_SILENT,
     WCCP_REASON_MAILBOX_MISSING,
-    WCCP_REASON_CODES, // the number of codes
+    WCCP_REASON_RESTART_NEEDED, // a change takes effect only when the group starts again
+    WCCP_REASON_CODES,          // the number of codes
 };
 
 struct wccp_reason_text {

@@ -233,6 +233,7 @@ void remove_silent_router(wccp_service_group *group, wccp_sending_router *router
         group->ret_method = WCCP_METHOD_NONE;
         wccp_appliance_state_init(group);
         group->state_flags &= ~WCCP_CAPABILITIES_SET;
+        wccp_forget_reasons(group, WCCP_REASON_RESTART_NEEDED);
     }
     if (router->self_buckets != 0) { // it redirected to this appliance
         if (group->redirecting_routers != 0)

@@ -130,7 +130,8 @@ TEST_F(Notify, ACommandGetsTheChangeAndItsReason) {
                           {}),
               "KIND=health|GROUP=7|ALARM=|SOURCE=|STATE=down|PREVIOUS=before|REASON=proxy-down|CAUSE=no?"
               "answer?[1m" +
-                  std::string(242, 'x') + "|NEXT=start the proxy: mgmtctl intercept show 7|MERGED=2|");
+                  std::string(242, 'x') +
+                  "|NEXT=start the proxy; mgmtctl intercept show 7 shows its state|MERGED=2|");
     EXPECT_EQ(environment(alarm(EVENT_RAISE_ALARM, "196641", "tunneld"), {loop}),
               "KIND=alarm|GROUP=|ALARM=restart-loop|SOURCE=tunneld|STATE=raised|PREVIOUS=before|REASON="
               "restart-loop|"

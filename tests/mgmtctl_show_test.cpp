@@ -302,7 +302,9 @@ TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
         {"S/oper", "BACKUP",
          "redirected-elsewhere: this appliance gets nothing: the routers redirect to 10.0.0.102 75%"},
         {"S/oper", "INIT", "waiting-assignment: the routers answer; no table is in force yet (10.0.0.101 is"},
-        {"C/encap", "l2", "restart-needed: the group runs with forwarding by gre, but is configured with l2"},
+        {"S/reason", "restart-needed 0.0.0.0 forwarding by gre/L2",
+         "restart-needed: the group runs with forwarding by gre, but is configured with L2\n    for "
+         "0:01:10\n"},
         {"C/admin", "down", "  nothing needs attention\n  disabled: the group is disabled\n", 0},
         {"C/router/4/ipaddr", "10.0.0.4", "10.0.0.4 does not answer (7 Here-I-Am sent)\n    for 0:01:10\n"},
     };
@@ -347,6 +349,18 @@ TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
         for (const json &each : parsed["reasons"])
             EXPECT_TRUE(each["cause"] != "" && each["next"] != "") << each;
     }
+}
+
+TEST(Show, AnAlarmHasTheReasonThatFitsIt) {
+    std::vector<reason> reasons;
+    for (const char *code : {"service-mismatch", "no-answer", "assignment-differs", "proxy-down"}) {
+        reasons.emplace_back().code = code;
+        reasons.back().group = 51;
+    }
+    EXPECT_EQ(alarm_reason(reasons, 51, "adjacency", "")->code, "no-answer");
+    EXPECT_EQ(alarm_reason(reasons, 51, "assignment", "")->code, "assignment-differs");
+    reasons.resize(1);
+    EXPECT_EQ(alarm_reason(reasons, 51, "adjacency", "")->code, "service-mismatch") << "there is no other";
 }
 
 TEST(Show, WhatIsNotKnownIsNotSaid) {
@@ -427,7 +441,7 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
     add_traffic(&from, TRAFFIC);
     const snapshot shown = from.gather();
     const std::string screen = joined(draw_screen(shown, {80, 0, false, false, ""}));
-    for (const char *text : {"51  left its routers",
+    for (const char *text : {"51  left its routers", "  router 10.0.0.3        not asked\n",
                              "\ntraffic  data plane user  1 tunnel\n"
                              "  51  proxy down 0:10:40  in 120  to proxy 100  returned 12  proxy down 8\n"
                              "  52  proxy up  in 99999  to proxy 18E  returned 0\n"

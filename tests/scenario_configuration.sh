@@ -46,13 +46,15 @@ case_nodes() {
     record_has 'WCCP service flags               : 0xe'
     record_has 'Configured MASK            : src-ip: 0x00000003, src-port: 0x0010'
     # The negotiated methods stay until the group starts again; then the changed ones are negotiated.
-    group_is a1 1 51 '.oper == "ACTIVE, DESIGNATED" and .router["1"].fwd_method == "L2" and .router["1"].assign_method == "HASH"'
+    group_is a1 1 51 '.oper == "ACTIVE, DESIGNATED" and .router["1"].fwd_method == "L2" and .router["1"].assign_method == "HASH" and
+        any(.reason[]; .code == "restart-needed" and .offered == "forwarding by L2" and .wanted == "gre")'
     change admin=down 'set admin down:2'
     router_is r1 5 51 '$g.appliances == []'
     group_is a1 5 51 '.oper == "INIT" and .num_routers == 0'
     change admin=up 'set admin up:1'
     wait_role a1 30 51 ACTIVE
-    group_is a1 10 51 '.router["1"].fwd_method == "GRE" and .router["1"].assign_method == "MASK"'
+    group_is a1 10 51 '.router["1"].fwd_method == "GRE" and .router["1"].assign_method == "MASK" and
+        all(.reason[]?; .code != "restart-needed")'
     router_is r1 10 51 '$g.service.flags == 14 and ($g.assignment.masks[0].mask | [.src_ip, .dst_ip, .src_port, .dst_port]) == [3, 1, 16, 32]'
     grep -q 'L2 return group 51 value 1: done' "$LAB/a1-tunneld.out" || die "tunneld did not get the L2 return"
     finish a1

@@ -294,7 +294,7 @@ kill -STOP "$(lab_pid a1 wccpd)"
 expect 3 '*wccpd does not answer*' show
 [[ $(<"$LAB/said") != *'no alarm'* ]] || fail 'show reports "no alarm" without wccpd'
 expect 3 '*wccpd-silent*' alarms --check
-expect 1 'jq:.reasons[0].reason == "wccpd-silent"' --json explain
+expect 1 'jq:.reasons[0] | .reason == "wccpd-silent" and .first_ms != null' --json explain
 ctl walk /qv >"$LAB/walked" 2>&1 &
 walk=$!
 expect 3 '' get $S/oper
@@ -302,6 +302,7 @@ complains "mgmtctl: $S/oper: wccpd-* did not answer in time"
 wait $walk && grep -q "^$G/weight = " "$LAB/walked" || fail "the walk did not skip wccpd"
 kill -CONT "$(lab_pid a1 wccpd)" "${LAB_PID[a1/wccpd]}"
 expect 0 '?*' get $S/oper
+expect 4 '' get /qv/alarms/state/process/wccpd/silent_since
 if lab_in a1 chown 1 /tmp/gcl-socks/uds-provider-mgmtd; then # fails in a user namespace with one user
     expect 3 '' get $S/oper
     complains "mgmtctl: /tmp/gcl-socks/uds-provider-mgmtd belongs to user 1; *"

@@ -184,13 +184,16 @@ void add_strips(std::string *out, const html_view &view, const snapshot_group &g
 
 // --- Routers and appliances
 
-html_markup connection_badge(const snapshot_group &group, const snapshot_router &router) {
+html_markup connection_badge(const snapshot &shown, const snapshot_group &group,
+                             const snapshot_router &router) {
     if (router.connection == "two-way")
         return make_badge(style::good, "two-way");
     if (router.connection == "one-way")
         return make_badge(style::warn, "one-way");
     if (router.connection != "none")
         return unknown_badge();
+    if (group.admin == "down" || is_out_of_its_routers(shown, group))
+        return make_badge(style::plain, "not asked");
     const auto noted = std::find_if(group.reasons.begin(), group.reasons.end(), [&](const auto &each) {
         return each.sender == router.address && each.count;
     });
@@ -215,7 +218,8 @@ html_markup table_badge(const snapshot_group &group, const snapshot_router &rout
     return table_state(group, static_cast<size_t>(table - group.tables.begin()));
 }
 
-void add_router(std::string *out, const snapshot_group &group, const snapshot_router &router) {
+void add_router(std::string *out, const snapshot &shown, const snapshot_group &group,
+                const snapshot_router &router) {
     const bool heard = router.connection == "two-way" || router.connection == "one-way";
     const auto method = [&](const std::string &word) {
         return !word.empty() ? html_of(word)
@@ -229,7 +233,7 @@ void add_router(std::string *out, const snapshot_group &group, const snapshot_ro
         add_html(out, " <span class=\"dim\">id ", router.id, "</span>");
     if (!router.configured)
         add_html(out, " <span class=\"dim\">not configured</span>");
-    add_html(out, "</td><td>", connection_badge(group, router), "</td><td>",
+    add_html(out, "</td><td>", connection_badge(shown, group, router), "</td><td>",
              heard ? duration_text(router.connected_ms) : "-", "</td><td>", method(router.forward),
              "</td><td>", method(router.assign), "</td><td>", method(router.back), "</td><td>",
              own == router.loads.end() ? html_of("<span class=\"dim\">-</span>") : html_of(own->percent, "%"),
@@ -363,7 +367,7 @@ void add_group(std::string *out, const html_view &view, const snapshot_group &gr
         add_html(out, "<h3>Routers</h3>");
         open_table(out, "routers");
         for (const snapshot_router &router : group.routers)
-            add_router(out, group, router);
+            add_router(out, view.shown, group, router);
         close_table(out);
     }
     add_html(out, "<h3>Appliances</h3>");

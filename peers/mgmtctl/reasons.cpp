@@ -10,6 +10,7 @@
 #include <map>
 
 #include "peers/mgmtctl/show_draw.h"
+#include "peers/mgmtctl/show_words.h"
 
 const std::vector<reason_text> &reason_texts() {
     static const std::vector<reason_text> texts = {
@@ -35,7 +36,7 @@ const std::vector<reason_text> &reason_texts() {
         {"not-configured", true, "wccpd runs the group although it is not configured",
          "restart wccpd; if the group comes back, report it"},
         {"left", true, "the group has left its routers: {offered}",
-         "mgmtctl intercept show {group}; the group returns with its proxy"},
+         "start the proxy, and the group returns; mgmtctl intercept show {group} shows its state"},
         {"drain", true, "the group is drained", "mgmtctl drain cancel {group} ends it"},
         {"interface-missing", true, "there is no interface {wanted}",
          "create it, or mgmtctl group set {group} interface NAME"},
@@ -140,7 +141,7 @@ const std::vector<reason_text> &reason_texts() {
         {"failure", true, "the kernel is not as wanted: something in it could not be changed",
          "tunneld tries again; its log has the details"},
         {"proxy-down", true, "the proxy is down; the last check has the reason",
-         "start the proxy: mgmtctl intercept show {group}"},
+         "start the proxy; mgmtctl intercept show {group} shows its state"},
         {"overload", true, "the proxy has too many flows; new ones are returned",
          "more appliances, a larger limit, or less weight"},
         {"slow-start", false, "slow start: a part of the weight is announced",
@@ -272,7 +273,8 @@ bool is_lasting(const std::string &code) {
     static const char *const codes[] = {"interface-missing", "interface-down",     "interface-no-address",
                                         "port-taken",        "socket-failed",      "join-failed",
                                         "router-silent",     "election-blocked",   "assignment-differs",
-                                        "not-acknowledged",  "appliance-left-out", "mailbox-missing"};
+                                        "not-acknowledged",  "appliance-left-out", "mailbox-missing",
+                                        "restart-needed"};
     return std::any_of(std::begin(codes), std::end(codes), [&](const char *each) { return code == each; });
 }
 
@@ -334,29 +336,6 @@ void add_missing_traffic(const snapshot_group &group, reason_list *list) {
         list->add_state("not-designated", group, lowest_appliance(group), "");
 }
 
-// Changes that a running group follows only after a restart.
-void add_changes_not_followed(const snapshot_group &group, reason_list *list) {
-    for (const snapshot_router &router : group.routers) {
-        const bool encap = !router.forward.empty() && !group.encap.empty() && group.encap != "either" &&
-                           group.encap != router.forward;
-        const bool assign = !router.assign.empty() && !group.assign_method.empty() &&
-                            group.assign_method != "either" && group.assign_method != router.assign;
-        if (!encap && !assign)
-            continue;
-        list->add_state("restart-needed", group, router.address,
-                        encap ? "forwarding by " + router.forward : "assignment by " + router.assign,
-                        encap ? group.encap : group.assign_method);
-        return;
-    }
-}
-
-// mgmtd then gives wccpd "down" for its admin.
-bool is_out_of_its_routers(const snapshot &shown, const snapshot_group &group) {
-    return shown.traffic.left.contains(group.id) ||
-           std::any_of(shown.traffic.drains.begin(), shown.traffic.drains.end(),
-                       [&](const traffic_drain &each) { return each.group == group.id; });
-}
-
 void add_group_reasons(const snapshot &shown, const snapshot_group &group, reason_list *list) {
     if (group.admin == "down") {
         list->add_state("disabled", group, "", "");
@@ -375,7 +354,8 @@ void add_group_reasons(const snapshot &shown, const snapshot_group &group, reaso
     if (!group.configured)
         list->add_state("not-configured", group, "", "");
     std::vector<snapshot_reason> noted = group.reasons;
-    if (is_out_of_its_routers(shown, group))
+    const bool out = is_out_of_its_routers(shown, group);
+    if (out)
         std::erase_if(noted, [](const snapshot_reason &each) { return each.code == "group-disabled"; });
     add_noted(noted, group.id, list);
     for (const snapshot_router &router : group.routers)
@@ -385,9 +365,9 @@ void add_group_reasons(const snapshot &shown, const snapshot_group &group, reaso
             add_noted({*each}, group.id, list);
     if (shown.brief)
         return;
-    add_unheard_routers(shown, group, list);
+    if (!out)
+        add_unheard_routers(shown, group, list);
     add_missing_traffic(group, list);
-    add_changes_not_followed(group, list);
     const bool sorts = shown.traffic.tunneld == tunneld_condition::running && shown.traffic.plane != "table";
     const bool intercepted =
         std::any_of(shown.traffic.intercepts.begin(), shown.traffic.intercepts.end(),
@@ -422,8 +402,8 @@ void add_traffic_reasons(const snapshot &shown, reason_list *list) {
 void add_process_reason(const snapshot &shown, const std::string &name, bool absent, reason_list *list) {
     reason *made = list->add_reason((name + (absent ? "-absent" : "-silent")).c_str(), -1);
     const auto known = shown.processes.find(name);
-    if (absent && known != shown.processes.end() && !known->second.running)
-        made->first_ms = ms_since(known->second.since);
+    if (known != shown.processes.end() && known->second.running != absent)
+        made->first_ms = ms_since(absent ? known->second.since : known->second.silent_since);
 }
 
 void add_restart_loops(const snapshot &shown, reason_list *list) {
@@ -469,10 +449,25 @@ const reason *main_reason(const std::vector<reason> &reasons, int group) {
     return found == reasons.end() ? nullptr : &*found;
 }
 
+namespace {
+// The first reason that can have caused the alarm, or else the main one.
+const reason *group_alarm_reason(const std::vector<reason> &reasons, int group, bool adjacency) {
+    const size_t last = place_of("election-blocked"), table = place_of("mask-differs"),
+                 end = place_of("lack");
+    for (const reason &each : reasons) {
+        const size_t place = place_of(each.code);
+        if (each.group == group && each.attention && each.code != "service-mismatch" &&
+            (adjacency ? place < table : place >= last && place < end))
+            return &each;
+    }
+    return main_reason(reasons, group);
+}
+} // namespace
+
 const reason *alarm_reason(const std::vector<reason> &reasons, int group, const std::string &alarm,
                            const std::string &source) {
     if (group >= 0 && (alarm == "adjacency" || alarm == "assignment"))
-        return main_reason(reasons, group);
+        return group_alarm_reason(reasons, group, alarm == "adjacency");
     const auto found = std::find_if(reasons.begin(), reasons.end(), [&](const reason &each) {
         return each.group == group && each.code == alarm && (group >= 0 || each.who == source);
     });

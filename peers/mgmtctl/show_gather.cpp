@@ -397,6 +397,8 @@ bool gather_processes(gathering *work) {
             process->running = binding.value == "running";
         else if (parts[1] == "since")
             process->since = clean_text(binding.value, 31);
+        else if (parts[1] == "silent_since")
+            process->silent_since = clean_text(binding.value, 31);
         else if (parts[1] == "restarts")
             process->restarts = number_of<uint64_t>(binding.value, 0);
     }
@@ -423,7 +425,7 @@ bool gather_alarms(gathering *work) {
         work->shown.roles_active += binding.value == "ACTIVE";
         work->shown.roles_backup += binding.value == "BACKUP";
     }
-    return gather_processes(work);
+    return true;
 }
 
 bool gather_redirected(gathering *work) {
@@ -460,7 +462,7 @@ void gather_all(gathering *work) {
         !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_STATUS, &alive) ||
         !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_VERSION, &version) ||
         !work->ask_wccpd(ctl_walk::children, NODE_GROUP_STATE, &states) ||
-        !gather_reasons(work, NODE_WCCPD_STATE, &work->shown.reasons))
+        !gather_reasons(work, NODE_WCCPD_STATE, &work->shown.reasons) || !gather_processes(work))
         return;
     work->shown.mode = first_value(mode);
     work->shown.status = first_value(alive);

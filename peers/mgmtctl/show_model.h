@@ -78,7 +78,8 @@ struct snapshot_group {
 };
 struct snapshot_process {
     bool running = false;
-    std::string since; // it runs, or is gone
+    std::string since;        // it runs, or is gone
+    std::string silent_since; // it has answered no query; empty: it answers, or has not been asked
     uint64_t restarts = 0;
 };
 enum class wccpd_condition { running, silent, absent };

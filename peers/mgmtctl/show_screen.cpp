@@ -250,7 +250,7 @@ void draw_router(screen *on, const snapshot_group &group, const snapshot_router 
         const snapshot_reason *noted = router_reason(on->shown, group, router);
         if (on->shown.wccpd != wccpd_condition::running)
             add_cells(&line, "unknown", style::dim);
-        else if (group.admin == "down")
+        else if (group.admin == "down" || is_out_of_its_routers(on->shown, group))
             add_cells(&line, "not asked", style::dim);
         else
             add_cells(&line, noted ? noted->code : "nothing heard", style::bad);

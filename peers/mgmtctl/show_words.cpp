@@ -76,6 +76,13 @@ bool is_in_alarm(const snapshot &shown, const snapshot_group &group) {
                        [&](const snapshot_alarm &alarm) { return alarm.group == group.id; });
 }
 
+bool is_out_of_its_routers(const snapshot &shown, const snapshot_group &group) {
+    return shown.traffic.left.contains(group.id) ||
+           std::any_of(
+               shown.traffic.drains.begin(), shown.traffic.drains.end(),
+               [&](const traffic_drain &each) { return each.group == group.id && each.state != "draining"; });
+}
+
 std::pair<std::string, style> group_state_words(const snapshot &shown, const snapshot_group &group,
                                                 bool troubled) {
     if (group.admin == "down")

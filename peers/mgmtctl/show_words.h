@@ -23,5 +23,7 @@ std::string group_counts(const snapshot &shown);                      // "3 grou
 std::pair<std::string, style> group_state_words(const snapshot &shown, const snapshot_group &group,
                                                 bool troubled = false);
 bool is_in_alarm(const snapshot &shown, const snapshot_group &group);
+// Whether it has left its routers, drained or without a proxy: wccpd is given "down" for it then.
+bool is_out_of_its_routers(const snapshot &shown, const snapshot_group &group);
 // What an alarm is about: its cause, where one is known.
 std::string alarm_cause(const snapshot_alarm &alarm, const std::vector<reason> &reasons);

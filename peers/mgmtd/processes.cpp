@@ -1,6 +1,8 @@
 // The processes of wccpd and tunneld, as their sessions show them:
 //
-//   /qv/alarms/state/process/NAME                "running" or "gone"; below it pid, since, restarts
+//   /qv/alarms/state/process/NAME                "running" or "gone"; below it pid, since, restarts, and
+//                                                silent_since, the time of the first query in a row that it
+//                                                has not answered
 //
 // A daemon that has not been seen yet has no node. A session with another process id is a restart. With
 // --supervise, the supervisor reports the restarts instead, because it also sees those of a program that
@@ -70,10 +72,23 @@ void server_note_process(server *self, const std::string &session) {
     self->state[root] = {bn_type_str, running ? "running" : "gone"};
     self->state[root.below("pid")] = {bn_type_uint32, pid};
     self->state[root.below("since")] = server_time_now();
+    self->state.erase(root.below("silent_since"));
     self->state.try_emplace(root.below("restarts"), node_value{bn_type_uint32, "0"});
     self->restarts[daemon].running_since_ms = running ? self->now_ms() : -1;
     if (running && !same && !known_pid.empty() && !self->supervises)
         server_note_restart(self, daemon, "");
+}
+
+void server_note_answer(server *self, const std::string &session, bool answered) {
+    std::string pid;
+    const char *daemon = find_daemon_of(session, &pid);
+    if (!daemon)
+        return;
+    const node_name silent = parsed_name(NODE_PROCESSES).below(daemon).below("silent_since");
+    if (answered)
+        self->state.erase(silent);
+    else
+        self->state.try_emplace(silent, server_time_now());
 }
 
 void server_note_restart(server *self, const std::string &process, const std::string &last_end) {

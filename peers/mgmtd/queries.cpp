@@ -380,6 +380,7 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
     const auto found = self->pending.find(msg->response_to);
     if (found == self->pending.end() || found->second.provider != peer_id)
         return; // the query has timed out, or was sent to another session
+    server_note_answer(self, self->peers.at(peer_id).name, true);
     pending_query query = server_take_pending(self, found);
     if (!gather_answer(self, &query, msg, bytes))
         return;

@@ -357,6 +357,7 @@ void answer_late_queries(server *self) {
         const auto provider = self->peers.find(query.provider);
         const std::string name = provider == self->peers.end() ? "the daemon" : provider->second.name;
         self->say("query: no answer from " + name);
+        server_note_answer(self, name, false);
         server_answer_without(self, query, LC_IO_TIMED_OUT, name + " did not answer in time");
     }
 }

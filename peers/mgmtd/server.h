@@ -206,6 +206,8 @@ void server_remove_report(server *self, const node_name &root);
 
 // Processes of the daemons (processes.cpp). To be called when a session has opened or closed.
 void server_note_process(server *self, const std::string &session);
+// The daemon has answered a query, or has not in time.
+void server_note_answer(server *self, const std::string &session, bool answered);
 // The process has been started again. `last_end` is how it ended before ("exited with 1"), or empty.
 void server_note_restart(server *self, const std::string &process, const std::string &last_end);
 int64_t server_clear_restart_alarms(server *self); // gives when to call it again, or -1
