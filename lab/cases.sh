@@ -79,6 +79,10 @@ group_is() { # APPLIANCE SECONDS GROUP JQ
 tunneld_is() { # APPLIANCE SECONDS KIND JQ : as lab_tunneld_state prints it
     lab_wait "$2" "$4" lab_tunneld_state "$1" "$3" || die "$3 of $1"
 }
+explains() { # APPLIANCE SECONDS GROUP CODE [WORDS] : explain has this reason, with WORDS in its cause; GROUP null: of no group
+    lab_wait "$2" "any(.reasons[]; .group == $3 and .reason == \"$4\" and .first_ms != null and (.cause | contains(\"${5-}\")))" \
+        eval "lab_manage $1 explain || [ \$? = 1 ]" || die "explain of $1 has no $4"
+}
 wait_role() { # APPLIANCE SECONDS GROUP ROLE
     lab_wait_role "$2" "$1" "$3" "$4" || die "role of group $3 in $1"
 }

@@ -72,6 +72,7 @@ case_other_methods() {
     start_member a1 10.0.0.101 10.0.0.1 10.0.0.2 encap=l2
     wait_log a1 20 'incompatible capabilities \(router id 10\.0\.0\.1\) : local: \(fwd encap: L2 '
     group_is a1 20 60 "$ids == [\"10.0.0.2\"]"
+    explains a1 5 60 forwarding-not-offered '10.0.0.1 offers forwarding by gre, but L2 is wanted'
     # r1 is in no view; therefore neither the group nor the table waits for it.
     router_is r2 40 60 '$g.assignment.kind == "mask"'
     finish a1
@@ -90,6 +91,7 @@ case_weight() {
     router_is r1 25 60 "$(shares 10.0.0.102 0)"
     wait_role a2 15 60 BACKUP
     group_is a2 5 60 '.oper == "BACKUP"'
+    explains a2 5 60 weight-zero '10.0.0.101 100%'
     finish a1 a2
 }
 
@@ -104,6 +106,7 @@ case_routers_stop() {
     lab_ctl r1 stop >/dev/null
     wait_role a1 50 60 BACKUP
     group_is a1 5 60 '.router == null and .oper == "INIT"'
+    explains a1 5 60 router-silent 10.0.0.1
     lab_wait_event 60 a1 '^alarm raised: eth0:grp:60 .*adjacency down' || die "no alarm"
     lab_ctl r1 resume >/dev/null
     lab_ctl r2 resume >/dev/null

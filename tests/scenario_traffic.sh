@@ -120,12 +120,14 @@ case_proxy_down() {
     fetches "$direct" --count 8
     router_is r1 30 51 '$g.appliances == []'
     tunneld_is a1 5 intercept '.["51"].left'
+    explains a1 5 51 left 'connection refused'
     [ "$(lab_manage a1 get /qv/wccpd/wccp/srv_grp/config/51/admin | jq -r '[.. | .value? // empty][0]')" = up ] || die "the configuration changed"
     fetches "$direct" --count 8
     # shellcheck disable=SC2086
     configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 "${quick%% *}" ${quick#* } leave_after=0)"
     router_is r1 30 51 '$g.appliances != []'
     tunneld_is a1 5 intercept '.["51"].left | not'
+    explains a1 5 51 proxy-down 'connection refused'
     fetches "$direct" --count 8
     lab_proxy a1
     wait_ready 51 a1
@@ -152,6 +154,7 @@ case_leaving() {
     begin_long
     configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 limit=7)"
     tunneld_is a1 5 intercept '.["51"].overloaded'
+    explains a1 5 51 overload '8 flows'
     lab_manage a1 alarms | jq -e 'length == 1 and .[0].name == "overload"' >/dev/null || die "$(lab_manage a1 alarms)"
     fetches "$direct" --count 4
     tunneld_is a1 5 intercept '.["51"].overload >= 4'
@@ -165,6 +168,7 @@ case_leaving() {
     lab_manage a1 drain 51 for 30 wait >"$LAB/drained" &
     drain=$!
     router_is r1 10 51 '$g.appliances[0].weight == 0'
+    explains a1 5 51 drain '8 flows left'
     lab_manage a1 drain show | jq -e '.drains == [{group: 51, state: "draining", flows: 8, until: .drains[0].until}]' >/dev/null || die "$(lab_manage a1 drain show)"
     fetches "$direct" --count 4
     end_long
@@ -191,6 +195,7 @@ case_leaving() {
     lab_in a1 ip link show wccp0 >/dev/null || die "the link is gone before the tunnel has lingered"
     fetches "$direct" --count 4
     lab_stop a1 tunneld || die "tunneld exited with $?"
+    explains a1 5 null tunneld-absent
     ! lab_in a1 ip link show wccp0 >"$LAB/remains" 2>&1 || die "the link is left"
     finish a1
 }
@@ -223,6 +228,7 @@ case_own_traffic() {
     fetches "$(by a1)" --count 32 --sources 32
     tunneld_is a1 10 tunnel '[.[].own] | add >= 32'
     tunnel_show_has a1 "the router redirects this appliance's own traffic"
+    explains a1 5 null own-traffic
     finish a1
 }
 case_own_spoofed() {
@@ -254,6 +260,7 @@ case_accept() {
     fetches '.fetched == 0' --timeout 1
     tunneld_is a1 10 plane '.refused_source["10.1.0.1"] >= 1'
     tunnel_show_has a1 'refused source 10\.1\.0\.1: mgmtctl tunnel accept 10\.1\.0\.1'
+    explains a1 5 null refused-source 10.1.0.1
     lab_manage a1 tunnel accept 10.1.0.1 >/dev/null || die "tunnel accept failed"
     fetches_within 5 "$(by a1)" --count 4
     fetches "$direct" --count 4 --port 8080
@@ -275,6 +282,7 @@ case_roles() {
     for i in 1 2; do
         lab_ctl r2 stop >/dev/null
         active_is false 30
+        explains a1 5 51 standing-by
         fetches "$direct" --count 4
         lab_ctl r2 resume >/dev/null
         active_is true 30

@@ -56,6 +56,7 @@ case_silent() {
 case_refusing() {
     start_group --refuse
     check_no_tunnel
+    explains a1 5 51 tunnel-refused 10.0.0.1
     finish a1
 }
 run_within() { # MILLISECONDS COMMAND...
