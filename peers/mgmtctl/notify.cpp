@@ -30,6 +30,7 @@
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/connection.h"
+#include "peers/mgmtctl/group_words.h"
 #include "peers/mgmtctl/notify_command.h"
 #include "peers/mgmtctl/notify_words.h"
 #include "peers/mgmtctl/show_gather.h"
@@ -368,6 +369,5 @@ int ctl_notify(const ctl_options &options, const std::string &word, const ctl_no
         return run_notifier(options, how);
     if (word == "list")
         return list_commands(options, how);
-    return tell_failure(options,
-                        {CTL_USAGE, "", "\"notify " + word + "\" is not a command: run or list", "", 0});
+    return tell_failure(options, {CTL_USAGE, "", unknown_word_text(word, {"run", "list"}), "", 0});
 }

@@ -117,7 +117,7 @@ const std::vector<reason_text> &reason_texts() {
         {"mask-differs", true, "{who} uses the mask {offered}; here it is {wanted}",
          "set the same mask on all appliances"},
         {"appliance-left-out", true, "{who} gets no share: {offered} of {wanted} routers list it",
-         "let all routers list {who}"},
+         "give {who} all routers of the group, and check the routers' lists of appliances"},
         {"table-not-built", true, "no table can be built: {offered}", "mgmtctl group restart {group}"},
         {"not-acknowledged", true, "{who} has not acknowledged the table ({offered}, wanted {wanted})",
          "wait 20 s; then look at the router's log for refused assignments"},
