@@ -469,12 +469,12 @@ int run_fetch(const fetch_options &options) {
         workers.emplace_back(fetch_many, std::cref(options), began, &all);
     for (std::thread &one : workers)
         one.join();
-    const double ended = wall_seconds();
+    const double finished = wall_seconds();
     const uint64_t each = (options.upload ? options.upload : options.size) * options.requests;
     const nlohmann::ordered_json result = {
         {"fetched", all.good},      {"failed", all.failed},
-        {"bytes", all.good * each}, {"seconds", ended - began},
-        {"slowest", all.slowest},   {"longest_gap", std::max(all.longest_gap, ended - all.last_good)},
+        {"bytes", all.good * each}, {"seconds", finished - began},
+        {"slowest", all.slowest},   {"longest_gap", std::max(all.longest_gap, finished - all.last_good)},
         {"proxies", all.proxies},   {"peers", all.peers},
         {"failures", all.failures}};
     puts(result.dump().c_str());

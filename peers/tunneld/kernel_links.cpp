@@ -23,9 +23,6 @@ std::string read_text(const nlattr *attribute) {
     return {text, strnlen(text, static_cast<size_t>(nla_len(attribute)))};
 }
 
-uint32_t read_u32(const nlattr *attribute) {
-    return attribute && nla_len(attribute) >= 4 ? nla_get_u32(attribute) : 0;
-}
 uint16_t read_u16(const nlattr *attribute) {
     return attribute && nla_len(attribute) >= 2 ? nla_get_u16(attribute) : uint16_t{0};
 }
@@ -38,8 +35,8 @@ gre_ends read_gre(nlattr *data) {
     gre_ends ends;
     if (!data || nla_parse_nested(attributes, IFLA_GRE_MAX, data, nullptr) < 0)
         return ends;
-    ends.local = ntohl(read_u32(attributes[IFLA_GRE_LOCAL]));
-    ends.remote = ntohl(read_u32(attributes[IFLA_GRE_REMOTE]));
+    ends.local = ntohl(read_netlink_u32(attributes[IFLA_GRE_LOCAL]));
+    ends.remote = ntohl(read_netlink_u32(attributes[IFLA_GRE_REMOTE]));
     ends.flags_in = read_u16(attributes[IFLA_GRE_IFLAGS]);
     ends.flags_out = read_u16(attributes[IFLA_GRE_OFLAGS]);
     ends.ttl = read_u8(attributes[IFLA_GRE_TTL]);
@@ -75,13 +72,13 @@ std::optional<found_link> read_link(nlmsghdr *message) {
     found_link link;
     link.name = read_text(attributes[IFLA_IFNAME]);
     link.kind = read_text(info[IFLA_INFO_KIND]);
-    link.group = read_u32(attributes[IFLA_GROUP]);
+    link.group = read_netlink_u32(attributes[IFLA_GROUP]);
     if ((link.kind != "tun" && link.kind != "gre") || (link.group != LINK_GROUP && !link_number(link.name)))
         return std::nullopt;
     const auto *header = static_cast<const ifinfomsg *>(nlmsg_data(message));
     link.index = header->ifi_index;
     link.is_up = header->ifi_flags & IFF_UP;
-    link.mtu = read_u32(attributes[IFLA_MTU]);
+    link.mtu = read_netlink_u32(attributes[IFLA_MTU]);
     link.alias = read_text(attributes[IFLA_IFALIAS]);
     link.wish = parse_link_alias(link.alias);
     if (link.kind == "gre")

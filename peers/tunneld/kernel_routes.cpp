@@ -15,10 +15,6 @@ namespace {
 
 constexpr uint32_t WHOLE_MARK = 0xFFFFFFFF;
 
-uint32_t read_u32(const nlattr *attribute, uint32_t missing = 0) {
-    return attribute && nla_len(attribute) >= 4 ? nla_get_u32(attribute) : missing;
-}
-
 std::string name_of_index(int index) {
     char name[IFNAMSIZ] = "";
     return index && if_indextoname(static_cast<unsigned>(index), name) ? name : "";
@@ -34,17 +30,17 @@ void read_route(nlmsghdr *message, std::vector<found_route> *out) {
         nlmsg_parse(message, sizeof(rtmsg), attributes, RTA_MAX, nullptr) < 0)
         return;
     const auto *header = static_cast<const rtmsg *>(nlmsg_data(message));
-    const uint32_t table = read_u32(attributes[RTA_TABLE], header->rtm_table);
+    const uint32_t table = read_netlink_u32(attributes[RTA_TABLE], header->rtm_table);
     if (header->rtm_protocol != ROUTE_PROTOCOL || header->rtm_family != AF_INET || !is_our_table(table))
         return;
     found_route found;
     found.type = header->rtm_type;
     found.prefix_length = header->rtm_dst_len;
-    found.destination = read_u32(attributes[RTA_DST]);
-    found.priority = read_u32(attributes[RTA_PRIORITY]);
-    found.out_index = static_cast<int>(read_u32(attributes[RTA_OIF]));
+    found.destination = read_netlink_u32(attributes[RTA_DST]);
+    found.priority = read_netlink_u32(attributes[RTA_PRIORITY]);
+    found.out_index = static_cast<int>(read_netlink_u32(attributes[RTA_OIF]));
     const bool local = header->rtm_type == RTN_LOCAL;
-    const uint32_t via = ntohl(read_u32(attributes[RTA_GATEWAY]));
+    const uint32_t via = ntohl(read_netlink_u32(attributes[RTA_GATEWAY]));
     found.route = {table, local, local ? "" : name_of_index(found.out_index), via};
     found.odd = (!local && header->rtm_type != RTN_UNICAST) || found.prefix_length || found.priority ||
                 (via && !(header->rtm_flags & RTNH_F_ONLINK));
@@ -83,9 +79,9 @@ void read_rule(nlmsghdr *message, std::vector<found_rule> *out) {
     if (header->family != AF_INET || !protocol || nla_get_u8(protocol) != ROUTE_PROTOCOL)
         return;
     found_rule found;
-    found.rule.preference = read_u32(attributes[FRA_PRIORITY]);
-    found.rule.mark = read_u32(attributes[FRA_FWMARK]);
-    found.rule.table = read_u32(attributes[FRA_TABLE], header->table);
+    found.rule.preference = read_netlink_u32(attributes[FRA_PRIORITY]);
+    found.rule.mark = read_netlink_u32(attributes[FRA_FWMARK]);
+    found.rule.table = read_netlink_u32(attributes[FRA_TABLE], header->table);
     if (const nlattr *name = attributes[FRA_IIFNAME])
         found.rule.in_interface.assign(
             static_cast<const char *>(nla_data(name)),
@@ -93,7 +89,7 @@ void read_rule(nlmsghdr *message, std::vector<found_rule> *out) {
     const uint32_t whole = found.rule.mark ? WHOLE_MARK : 0;
     found.odd = header->action != FR_ACT_TO_TBL || header->src_len || header->dst_len || header->tos ||
                 (header->flags & FIB_RULE_INVERT) || attributes[FRA_OIFNAME] ||
-                read_u32(attributes[FRA_FWMASK], whole) != whole;
+                read_netlink_u32(attributes[FRA_FWMASK], whole) != whole;
     out->push_back(found);
 }
 

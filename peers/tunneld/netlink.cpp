@@ -121,6 +121,10 @@ int query_kernel(nl_msg *message, const std::function<void(nlmsghdr *)> &each,
     return error;
 }
 
+uint32_t read_netlink_u32(const nlattr *attribute, uint32_t missing) {
+    return attribute && nla_len(attribute) >= 4 ? nla_get_u32(attribute) : missing;
+}
+
 void close_kernel_socket() {
     kernel.reset();
 }

@@ -26,6 +26,10 @@ int change_kernel(nl_msg *message);
 int query_kernel(nl_msg *message, const std::function<void(nlmsghdr *answer)> &each,
                  const std::function<void()> &restart);
 
+// The value of an attribute of 32 bits in the byte order that it has there, or `missing` when the attribute
+// is absent or shorter.
+uint32_t read_netlink_u32(const nlattr *attribute, uint32_t missing = 0);
+
 // Closes the socket, which the next request opens again. For a process that changes its network namespace, or
 // that was forked and must not share the socket.
 void close_kernel_socket();
