@@ -35,10 +35,6 @@ TEST_F(DaemonMain, ThePidFile) {
     std::ofstream(PID_FILE) << "an earlier text that is longer than any number";
     EXPECT_EQ(wccpd_pid_init(), LC_OK);
     EXPECT_EQ(content(PID_FILE), std::to_string(getpid()) + "\n");
-    struct stat found = {};
-    ASSERT_EQ(lstat(PID_FILE, &found), 0);
-    EXPECT_EQ(found.st_mode & 0777, 0644u);
-    EXPECT_EQ(said("Writing "), 0);
     unlink(PID_FILE);
     std::ofstream("/tmp/precious") << "kept";
     ASSERT_EQ(symlink("/tmp/precious", PID_FILE), 0);
@@ -94,11 +90,6 @@ TEST_F(DaemonMain, ReportsToItsServiceManager) {
     wccpd_service_deinit();
     EXPECT_EQ(lew_deinit(&wccpd_lwc), LC_OK);
     close(manager);
-}
-
-TEST_F(DaemonMain, NothingStartsWithoutALoop) {
-    EXPECT_EQ(wccpd_serv_init(), LC_ASSERTION);
-    EXPECT_EQ(wccpd_main_loop(), LC_NULL);
 }
 
 } // namespace

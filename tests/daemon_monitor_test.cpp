@@ -152,12 +152,8 @@ TEST_F(DaemonMonitor, ParentsAndAbsentNodes) {
         "colour nothing; router/1/colour nothing; oper/deeper nothing; router nothing; appliance nothing; "
         "router/1/appliance nothing");
     EXPECT_EQ(get("/qv/tunneld/system/state/proto_ver"), NOTHING);
-    for (const auto &[line, count] :
-         {std::pair{"wccp_get_grp_info failed: 1", 3},
-          {"Appliance number (at 9th) not found in /qv/wccpd/wccp/srv_grp/state/51/router/1/appliance", 1},
-          {"MonGet: last_name_part=deeper", 1},
-          {"MonGet not for wccpd, bailing - /qv/tunneld/system/state/proto_ver", 1}})
-        EXPECT_EQ(said(line), count) << line;
+    EXPECT_EQ(said("wccp_get_grp_info failed: 1"), 3);
+    EXPECT_EQ(said("MonGet not for wccpd, bailing - /qv/tunneld/system/state/proto_ver"), 1);
 }
 
 TEST_F(DaemonMonitor, Dumps) {

@@ -260,6 +260,7 @@ TEST_F(Config, ADeletedGroupSendsAShutdownMessageUnlessItIsInInit) {
         EXPECT_EQ(engine.sent_to("10.0.0.2").at(8 + 8 + 5), id) << "in ascending order of ids";
 }
 
+// engine_network_test has the groups that follow their interface.
 TEST_F(Config, StoppingAllSkipsDisabledGroups) {
     wccp_service_group *up = add(config(1)), *down = add(config(2)), *unset = add(config(3));
     down->admin_state = WCCP_ADMIN_DOWN;
@@ -268,19 +269,13 @@ TEST_F(Config, StoppingAllSkipsDisabledGroups) {
     EXPECT_EQ(wccp_stop_all_service_groups(), 0);
     EXPECT_EQ(up->change_number, 0u);
     EXPECT_EQ(up->admin_state, WCCP_ADMIN_UP);
-    wccp_interface *wan = engine.interface;
-    wan->ready_flags = WCCP_LINK_READY;
-    wccp_start_service_groups_by_interface(wan);
+    engine.interface->ready_flags = WCCP_LINK_READY;
+    wccp_start_service_groups_by_interface(engine.interface);
     EXPECT_EQ(up->hia_timer.active, 0);
-    wan->ready_flags = WCCP_ALL_READY;
-    wccp_start_service_groups_by_interface(wan);
-    EXPECT_EQ(up->hia_timer.active, 1);
-    wccp_stop_service_groups_by_interface(wan);
-    EXPECT_EQ(up->hia_timer.active, 0);
-    EXPECT_TRUE(wan->start_count == 2 && wan->stop_count == 1);
     EXPECT_EQ(modify(3, WCCP_CFG_ADMIN), 0); // disabled once more
     EXPECT_EQ(unset->admin_state, 0u);
     EXPECT_EQ((numbers{down->change_number, unset->change_number}), (numbers{3, 3}));
+    engine.interface->ready_flags = WCCP_ALL_READY;
     wccp_grp_config enabled = {};
     enabled.admin = WCCP_ADMIN_UP;
     EXPECT_EQ(modify(3, WCCP_CFG_ADMIN, enabled), 0);
@@ -290,14 +285,11 @@ TEST_F(Config, StoppingAllSkipsDisabledGroups) {
 // What the tests of the monitoring tree cannot see of the queries.
 TEST_F(Config, QueriesForUnknownValuesAndAbsentRecords) {
     wccp_service_group *group = add(config(61));
-    wccp_g.seconds = 100;
-    group->state_time = 40;
     wccp_grp_info info = {};
     for (const auto &[flags, word] : {std::pair{6u, "uknown"}, {3u, "unknown"}}) {
         group->state_flags = flags;
         EXPECT_EQ(wccp_get_grp_info(61, &info), 0);
         EXPECT_STREQ(info.oper, word);
-        EXPECT_EQ(info.uptime, 60u);
     }
     group->state_flags = WCCP_STATE_INIT | WCCP_CAPABILITIES_SET;
     group->assign_method = 9;
@@ -312,16 +304,10 @@ TEST_F(Config, QueriesForUnknownValuesAndAbsentRecords) {
         EXPECT_EQ(wccp_get_grp_router_info(61, &router), 0);
         EXPECT_EQ(router.conn_time, 4711u);
     }
-    EXPECT_EQ(wccp_get_grp_router_info(60, &router), 1);
     wccp_grp_appliance_info appliance = {.appliance_num = 1, .ipa = {}, .weight = 4711};
-    EXPECT_EQ(wccp_get_grp_appliance_info(61, &appliance), 0);
-    EXPECT_EQ(wccp_get_grp_appliance_info(60, &appliance), 0);
+    EXPECT_EQ(wccp_get_grp_appliance_info(61, &appliance) + wccp_get_grp_appliance_info(60, &appliance), 0);
     EXPECT_EQ(appliance.weight, 4711u);
-    EXPECT_EQ(wccp_get_grp_list(nullptr) + wccp_get_grp_info(61, nullptr), 2);
-    EXPECT_EQ(wccp_get_grp_router_info(61, nullptr) + wccp_get_grp_appliance_info(61, nullptr), 2);
-    EXPECT_EQ(wccp_get_router_list(nullptr) + wccp_get_router_appliance_list(nullptr) +
-                  wccp_get_router_appliance_info(nullptr),
-              3);
+    EXPECT_EQ(wccp_get_grp_info(61, nullptr) + wccp_get_grp_list(nullptr) + wccp_get_router_list(nullptr), 3);
 }
 
 } // namespace

@@ -1,4 +1,4 @@
-// Start and stop of the engine in both modes, the tick, allocation and text helpers, and the named threads.
+// Start and stop of the engine in both modes, the tick, allocation, and the named threads.
 
 #include <pthread.h>
 #include <sched.h>
@@ -122,21 +122,6 @@ TEST_F(Manager, AllocationsAreZeroedAndCounted) {
     EXPECT_EQ(wccp_g.stat_alloc_fails, 1u);
     EXPECT_EQ(wccp_g.stat_allocs, allocs + 2);
 #endif
-}
-
-TEST(Text, SecondsBecomeDaysHoursMinutesSeconds) {
-    const struct {
-        uint32_t seconds, length;
-        const char *text;
-    } rows[] = {{90061, 128, "1:1:1:1"}, {0xffffffff, 128, "49710:6:28:15"}, {59, 256 + 32, "0:0:0:59"},
-                {1, 31, "as it was"},    {1, 256 + 31, "as it was"},         {1, 256, "as it was"}};
-    char text[512];
-    for (const auto &row : rows) {
-        strlcpy(text, "as it was", sizeof text);
-        wccp_seconds_to_str(row.seconds, text, row.length);
-        EXPECT_STREQ(text, row.text);
-    }
-    wccp_seconds_to_str(1, nullptr, 128);
 }
 
 struct observation {

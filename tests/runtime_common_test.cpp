@@ -96,15 +96,13 @@ TEST(Strings, BoundedCopiesAndFormattedTexts) {
     EXPECT_STREQ(text, "abcdefg");
     EXPECT_EQ(strlcat(full, "12", sizeof full), 6u);
     EXPECT_EQ(memcmp(full, "wxyz", 4), 0);
-    for (const uint32_t length : {0u, 99u, 100u, 5000u}) {
-        const std::string wanted(length, 'x');
-        char *formatted = nullptr;
-        uint32_t out_length = 1;
-        ASSERT_EQ(snmprintf(&formatted, &out_length, "%s", wanted.c_str()), LC_OK);
-        const owned_text owner(formatted);
-        EXPECT_EQ(formatted, wanted);
-        EXPECT_EQ(out_length, length);
-    }
+    const std::string wanted(5000, 'x');
+    char *formatted = nullptr;
+    uint32_t length = 1;
+    ASSERT_EQ(snmprintf(&formatted, &length, "%s", wanted.c_str()), LC_OK);
+    const owned_text owner(formatted);
+    EXPECT_EQ(formatted, wanted);
+    EXPECT_EQ(length, wanted.size());
 }
 
 TEST(Lock, OwnersNestingAndRefusals) {

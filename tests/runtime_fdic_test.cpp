@@ -172,19 +172,15 @@ TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
 }
 
 TEST_F(FdicBridge, TimersFireOnce) {
-    int32_t id = 0;
-    ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, word(3), &id), LC_OK);
-    EXPECT_TRUE(calls.empty());
-    EXPECT_EQ(round(), (list_of{"3:3"}));
+    int32_t id = 0, soon = 0;
     int none = 0;
+    ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, word(3), &id), LC_OK);
+    EXPECT_EQ(round(), (list_of{"3:3"}));
     EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay does not start it again
     EXPECT_EQ(lew_dispatch_once(wrapper, &none, nullptr), LC_OK);
     EXPECT_EQ(none, 1);
-    EXPECT_EQ(fdic_event_update_timer(list, id, 6), LC_OK);
-    EXPECT_EQ(round(), (list_of{"3:3"}));
     // The largest delay does not overflow.
     EXPECT_EQ(fdic_event_update_timer(list, id, INT64_MAX), LC_OK);
-    int32_t soon = 0;
     ASSERT_EQ(fdic_event_add_timer(list, 1, this, called, word(9), &soon), LC_OK);
     EXPECT_EQ(round(), (list_of{"3:9"}));
     EXPECT_EQ(fdic_event_delete_timer(list, id), LC_OK);
