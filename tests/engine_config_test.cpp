@@ -178,10 +178,6 @@ TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
         {WCCP_CFG_MASK_DST_PORT, 7, 2, 5},
         {WCCP_CFG_MASK_SRC_IP, 7, 2, 7},
         {WCCP_CFG_PASSWORD, 7, 2, 7},
-        {WCCP_CFG_FWD_METHOD, 7, 2, 7},
-        {WCCP_CFG_FORCE_L2_RETURN, 7, 2, 7},
-        {WCCP_CFG_ASSIGN_METHOD, 7, 2, 7},
-        {WCCP_CFG_COMPATIBILITY, 7, 2, 7},
     };
     log_lines log;
     for (const auto &row : rows) {
@@ -191,10 +187,11 @@ TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
         EXPECT_EQ((numbers{group->weight, group->service_flags, group->mask_bits}),
                   (numbers{row.weight, row.service_flags, row.mask_bits}));
         EXPECT_TRUE(log.say(row.refusal));
-        EXPECT_EQ(modify(99, row.flags, fill), row.flags & WCCP_CFG_ADMIN ? 0 : 1);
-        EXPECT_TRUE(log.say("WCCP GRP 99 "));
     }
-    EXPECT_EQ(group->compat_mode + group->cfg_fwd_method + group->cfg_assign_method, 0u);
+    for (uint32_t flag = WCCP_CFG_ADMIN; flag <= WCCP_CFG_MASK_DST_PORT; flag <<= 1) { // a missing group
+        EXPECT_EQ(modify(99, flag, fill), flag == WCCP_CFG_ADMIN ? 0 : 1) << flag;
+        EXPECT_TRUE(log.say("WCCP GRP 99 ")) << flag;
+    }
     EXPECT_EQ(memcmp(group->password, "secret\0\0", 8), 0);
     EXPECT_EQ(modify(61, WCCP_CFG_PASSWORD), 0);
     EXPECT_TRUE(group->security_option == 0 && memcmp(group->password, "\0\0\0\0\0\0\0", 8) == 0);

@@ -308,28 +308,6 @@ TEST_F(Mailbox, AResetEndsAWaitWithoutAnAnswer) {
     }
 }
 
-TEST_F(Mailbox, APolicyGroupIsActiveOnlyWhenAllItsMembersAre) {
-    const uint8_t members[] = {0, 9, 255};
-    const struct {
-        std::function<int()> change;
-        uint32_t role;
-    } steps[] = {
-        {[] { return wccp_add_policy_grp(300, 0, nullptr); }, 2},
-        {[&] { return wccp_add_policy_grp(300, 3, members); }, 1}, // UNKNOWN counts like BACKUP
-        {[] { return wccp_set_role(0, 0) + wccp_set_role(9, 0); }, 1},
-        {[] { return wccp_set_role(255, 0); }, 0},
-        {[] { return wccp_set_role(0, 1); }, 1},
-        {[] { return wccp_remove_policy_grp(300, 0); }, 0},
-        {[] { return wccp_set_role(0, 1); }, 0}, // not a member any more
-        {[] { return wccp_remove_policy_grp(300, 9); }, 0},
-        {[] { return wccp_remove_policy_grp(300, 255); }, 2},
-    };
-    for (const auto &step : steps) {
-        EXPECT_EQ(step.change(), 0);
-        EXPECT_EQ(wccp_get_role(300), step.role) << &step - steps;
-    }
-}
-
 TEST_F(Mailbox, AServiceGroupFollowsItsLastPolicyGroup) {
     const uint8_t id = 51;
     wccp_set_role(id, 0);

@@ -6,6 +6,7 @@
 #include <algorithm>
 
 #include "lab/router/forward.h"
+#include "tests/support/wire_bytes.h"
 
 using namespace lab;
 
@@ -15,13 +16,8 @@ constexpr address ROUTER = 0x0a000001; // 10.0.0.1
 constexpr address LOW = 0x0a000065;    // 10.0.0.101
 constexpr address HIGH = 0x0a000066;   // 10.0.0.102
 
-bytes hex(const std::string &text) {
-    bytes out;
-    std::string digits;
-    std::copy_if(text.begin(), text.end(), std::back_inserter(digits), [](char c) { return c != ' '; });
-    for (size_t i = 0; i + 1 < digits.size(); i += 2)
-        out.push_back(static_cast<uint8_t>(std::stoi(digits.substr(i, 2), nullptr, 16)));
-    return out;
+bytes octets(const std::string &digits) {
+    return hex(digits).bytes;
 }
 std::string word(uint32_t value) {
     char text[9];
@@ -32,10 +28,7 @@ std::string zeros(size_t count) {
     return std::string(2 * count, '0');
 }
 bytes message(uint32_t type, const std::string &components) {
-    bytes body = hex(components);
-    bytes out = hex(word(type) + "0200" + word(static_cast<uint32_t>(body.size())).substr(4));
-    out.insert(out.end(), body.begin(), body.end());
-    return out;
+    return wire_message(type, {hex(components)});
 }
 // No security; dynamic service 51, priority 5, protocol 6 (TCP), hash on the destination address.
 const std::string PLAIN = "0000 0004 00000000";
@@ -106,9 +99,9 @@ TEST(LabRouter, EchoesTheHashAssignmentItAdopted) {
     // The view follows header, security, service and an identity with two addresses.
     const bytes view(answer.begin() + 44 + 28, answer.end());
     const bytes wanted =
-        hex("0004 0070" + word(change) + "0a000065 00000001 00000001 0a000001 00000002" +
-            "0a000065 0000 0000 ffffffffffffffffffffffff 0f" + zeros(19) + "0064 0000" +
-            "0a000066 0000 0000" + zeros(12) + "f0 ffffffffffffffffffffffffffffffffffffff 00c8 0000");
+        octets("0004 0070" + word(change) + "0a000065 00000001 00000001 0a000001 00000002" +
+               "0a000065 0000 0000 ffffffffffffffffffffffff 0f" + zeros(19) + "0064 0000" +
+               "0a000066 0000 0000" + zeros(12) + "f0 ffffffffffffffffffffffffffffffffffffff 00c8 0000");
     EXPECT_EQ(bytes(view.begin(), view.begin() + 0x74), wanted);
 }
 
@@ -142,7 +135,7 @@ TEST(LabRouter, SignsAndChecks) {
     lab.send(LOW, signed_hello);
     EXPECT_EQ(lab.result(), "refused: wrong digest");
     // Computed with md5sum: "secret\0\0" and the message with a digest of zeros.
-    const bytes digest = hex("bc76b5520d4b344b2f9ce814b8dbb9f3");
+    const bytes digest = octets("bc76b5520d4b344b2f9ce814b8dbb9f3");
     std::copy(digest.begin(), digest.end(), signed_hello.begin() + 16);
     const bytes answer = lab.send(LOW, signed_hello);
     ASSERT_FALSE(answer.empty()) << lab.result();
@@ -159,7 +152,7 @@ TEST(LabRouter, SignsAndChecks) {
 
 // IPv4 with the first bytes of TCP.
 bytes packet(const std::string &src, const std::string &dst, const std::string &ports) {
-    return hex("4500 002c 0001 4000 40 06 0000" + src + dst + ports + zeros(20));
+    return octets("4500 002c 0001 4000 40 06 0000" + src + dst + ports + zeros(20));
 }
 
 TEST(LabRouter, FindsTheOwnerOfAPacket) {
@@ -197,17 +190,17 @@ TEST(LabRouter, FindsTheOwnerOfAPacket) {
     EXPECT_EQ(ask(packet("0a020002", "0a010080", "00500050"), {51, 52}).in, &back);
 
     const verdict found = ask(web);
-    EXPECT_EQ(gre_header(lab.self, found), hex("0000 883e 80 33 00" + word(found.bucket).substr(6)));
+    EXPECT_EQ(gre_header(lab.self, found), octets("0000 883e 80 33 00" + word(found.bucket).substr(6)));
     lab.self.options.gre_format = "plain";
-    EXPECT_EQ(gre_header(lab.self, found), hex("0000 883e"));
+    EXPECT_EQ(gre_header(lab.self, found), octets("0000 883e"));
     lab.self.options.gre_format = "ip";
-    EXPECT_EQ(gre_header(lab.self, found), hex("0000 0800"));
+    EXPECT_EQ(gre_header(lab.self, found), octets("0000 0800"));
     const auto begins = [](const bytes &gre) { return inner_offset(gre.data(), gre.size()); };
-    EXPECT_EQ(begins(hex("0000 0800 45000014")), 4u);
-    EXPECT_EQ(begins(hex("0000 883e 45000014")), 4u);
-    EXPECT_EQ(begins(hex("0000 883e 80330007 45000014")), 8u);
-    EXPECT_EQ(begins(hex("2000 0800 45000014")), 0u);
-    EXPECT_EQ(begins(hex("0000 86dd 60000014")), 0u);
+    EXPECT_EQ(begins(octets("0000 0800 45000014")), 4u);
+    EXPECT_EQ(begins(octets("0000 883e 45000014")), 4u);
+    EXPECT_EQ(begins(octets("0000 883e 80330007 45000014")), 8u);
+    EXPECT_EQ(begins(octets("2000 0800 45000014")), 0u);
+    EXPECT_EQ(begins(octets("0000 86dd 60000014")), 0u);
 
     lab.in().current.buckets.fill(0);
     EXPECT_EQ(ask(web).owner, 0u);
