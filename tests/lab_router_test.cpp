@@ -191,10 +191,7 @@ TEST(LabRouter, FindsTheOwnerOfAPacket) {
 
     const verdict found = ask(web);
     EXPECT_EQ(gre_header(lab.self, found), octets("0000 883e 80 33 00" + word(found.bucket).substr(6)));
-    lab.self.options.gre_format = "plain";
-    EXPECT_EQ(gre_header(lab.self, found), octets("0000 883e"));
-    lab.self.options.gre_format = "ip";
-    EXPECT_EQ(gre_header(lab.self, found), octets("0000 0800"));
+    // scenario_traffic has the router's other headers.
     const auto begins = [](const bytes &gre) { return inner_offset(gre.data(), gre.size()); };
     EXPECT_EQ(begins(octets("0000 0800 45000014")), 4u);
     EXPECT_EQ(begins(octets("0000 883e 45000014")), 4u);

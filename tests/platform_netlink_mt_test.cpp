@@ -257,22 +257,6 @@ TEST(Closed, StateEventsArePassedToTheProgram) {
     EXPECT_EQ(transported, 3);
 }
 
-TEST(Closed, AddressText) {
-    char buffer[46];
-    EXPECT_EQ(get_addr_str(4, to_be32(0xC0A80A01), 0, buffer, sizeof buffer), buffer);
-    EXPECT_STREQ(buffer, "192.168.10.1");
-    EXPECT_STREQ(get_addr_str(4, to_be32(0xFFFFFFFF), 0, buffer, 15), "") << "no room for the terminator";
-    EXPECT_STREQ(get_addr_str(6, to_be32(1), 0, buffer, sizeof buffer), "");
-}
-
-TEST(Closed, TheInterfaceSocketIsOpenedOnce) {
-    qvif_network_init_sockets();
-    const int fd = g_qvif_skfd;
-    ASSERT_GE(fd, 0);
-    qvif_network_init_sockets();
-    EXPECT_EQ(g_qvif_skfd, fd);
-}
-
 TEST_F(Netlink, TheThreadIsSmallAndTakesNoSignal) {
     EXPECT_EQ(seen->links["lo"], "1/1") << "reported at the start";
 #ifndef WCCP_SANITIZED
