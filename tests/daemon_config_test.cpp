@@ -356,6 +356,10 @@ TEST_F(DaemonConfig, ChangesOfTheStartAreAppliedAfterIt) {
     EXPECT_TRUE(!wccp_find_group(52) && !wccp_find_group(53) && wccp_find_group(54));
     EXPECT_EQ(said("<139>"), 0);
 
+    keep_one("54/router/1/ipaddr", bn_type_ipv4addr, "10.0.0.9", bn_flag_deleted);
+    apply_early_changes();
+    EXPECT_EQ(wccp_find_group(54), nullptr);
+
     const std::string half(EARLY_CHANGES_MAX_BYTES / 2, 'x');
     keep_one("51/weight", bn_type_str, half.c_str());
     binding_list second;

@@ -299,6 +299,7 @@ TEST_F(Signals, BelongToOneContextAndTheirNumberIsChecked) {
     ASSERT_EQ(reg(wrapper, &slot, SIGUSR1), LC_OK);
     for (const int number : {SIGUSR1, 0, -1, 66})
         EXPECT_EQ(reg(other, &foreign, number), LC_ASSERTION);
+    EXPECT_EQ(reg(nullptr, &foreign, SIGUSR2), LC_NULL);
     EXPECT_EQ(foreign, nullptr);
     // A filled slot is registered again, but only in its own context.
     EXPECT_EQ(reg(other, &slot, SIGUSR2), LC_NOT_FOUND);

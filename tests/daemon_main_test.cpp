@@ -92,4 +92,9 @@ TEST_F(DaemonMain, ReportsToItsServiceManager) {
     close(manager);
 }
 
+TEST_F(DaemonMain, NothingStartsWithoutALoop) {
+    EXPECT_EQ(wccpd_serv_init(), LC_ASSERTION);
+    EXPECT_EQ(wccpd_main_loop(), LC_NULL);
+}
+
 } // namespace

@@ -304,7 +304,12 @@ TEST_F(Config, QueriesForUnknownValuesAndAbsentRecords) {
     wccp_grp_appliance_info appliance = {.appliance_num = 1, .ipa = {}, .weight = 4711};
     EXPECT_EQ(wccp_get_grp_appliance_info(61, &appliance) + wccp_get_grp_appliance_info(60, &appliance), 0);
     EXPECT_EQ(appliance.weight, 4711u);
-    EXPECT_EQ(wccp_get_grp_info(61, nullptr) + wccp_get_grp_list(nullptr) + wccp_get_router_list(nullptr), 3);
+    EXPECT_EQ(wccp_get_grp_router_info(60, &router), 1);
+    EXPECT_EQ(wccp_get_grp_list(nullptr) + wccp_get_grp_info(61, nullptr), 2);
+    EXPECT_EQ(wccp_get_grp_router_info(61, nullptr) + wccp_get_grp_appliance_info(61, nullptr), 2);
+    EXPECT_EQ(wccp_get_router_list(nullptr) + wccp_get_router_appliance_list(nullptr) +
+                  wccp_get_router_appliance_info(nullptr),
+              3);
 }
 
 } // namespace

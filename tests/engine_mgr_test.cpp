@@ -124,6 +124,18 @@ TEST_F(Manager, AllocationsAreZeroedAndCounted) {
 #endif
 }
 
+TEST(Text, ATimeIsWrittenOnlyWhereItFits) {
+    const struct {
+        uint32_t seconds, length;
+        const char *text;
+    } rows[] = {{0xffffffff, 128, "49710:6:28:15"}, {59, 256 + 32, "0:0:0:59"}, {1, 31, ""}, {1, 256, ""}};
+    for (const auto &row : rows) {
+        char text[512] = "";
+        wccp_seconds_to_str(row.seconds, text, row.length);
+        EXPECT_STREQ(text, row.text);
+    }
+}
+
 struct observation {
     size_t stack = 0;
     sigset_t blocked;

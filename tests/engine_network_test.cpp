@@ -500,6 +500,7 @@ TEST_F(Network, TheTableGrowsToItsLimitAndHasEachNameOnce) {
     for (uint32_t i = 0; i < LIMIT; i++)
         EXPECT_EQ(wccp_if_add_group(&group, &wccp_g.interfaces[i]), 0);
     EXPECT_EQ(wccp_if_add_group(&group, wan), 1);
+    EXPECT_EQ(wccp_if_add_group(nullptr, wan) + wccp_if_add_group(&group, nullptr), 2);
     for (wccp_interface &interface : wccp_g.interfaces)
         interface.groups = nullptr;
 }
@@ -508,6 +509,8 @@ TEST_F(Network, OtherNotificationsAreIgnored) {
     const wccp_interface before = *wan;
     notify_link("other0", 0, 0);
     wccp_process_if_ipa_update("other0");
+    wccp_process_if_ipa_update(nullptr);
+    wccp_process_if_state_change(nullptr);
     notify_link("wan0", 1, 1); // already up
     EXPECT_EQ(wccp_g.if_count, 1);
     wccpd_exiting = 1;

@@ -214,6 +214,8 @@ TEST_F(RouterTest, QueriesAboutRouters) {
     a->view_appliances[0].buckets_assigned = 5;
     EXPECT_TRUE(wccp_get_router_assignment(group, a, US, &buckets) == 0 && buckets == 5);
     EXPECT_TRUE(wccp_get_router_assignment(group, a, host(3), &buckets) == 1 && buckets == 0);
+    EXPECT_EQ(wccp_get_router_assignment(group, a, US, nullptr), 1);
+    EXPECT_EQ(wccp_get_router_connection_stats(nullptr, &one_way, &two_way), 1);
     EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, b), 0);
     a->view_appliances[1].buckets_assigned = 5;
     EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, b), 1);

@@ -144,6 +144,8 @@ TEST(Texts, RefusedTypesAndIds) {
     EXPECT_EQ(bn_attrib_new_str(&attrib, 1, bn_type_uint8, 0, nullptr), LC_NULL);
     for (const uint32_t id : {0u, 4u, 131u, 0xffffffffu})
         EXPECT_EQ(bn_attrib_new_uint32(&attrib, id, 0, 1), LC_ASSERTION) << id;
+    EXPECT_EQ(bn_attrib_new_macaddr802(&attrib, 1, 0, nullptr), LC_NULL);
+    EXPECT_EQ(bn_attrib_set_uint32(nullptr, 1, 0, 1), LC_NULL);
 
     binding_owner invalid, absent;
     ASSERT_EQ(bn_binding_new_str_autoinval(&invalid, "/a", 1, bn_type_uint32, 0, "abc"), LC_OK);
@@ -330,6 +332,8 @@ TEST(Bindings, TypedOperations) {
         const std::string lines = log.take();
         EXPECT_TRUE(*line ? lines.find(line) != std::string::npos : lines.empty()) << line << lines;
     };
+    expect(bn_binding_get_uint32(nullptr, 1, nullptr, &value), LC_NULL, "NULL binding passed");
+    expect(bn_binding_get_uint32(bare, 1, nullptr, &value), LC_NULL, "Unexpected NULL");
     expect(bn_binding_get_uint32(binding, 1, nullptr, &value), LC_ASSERTION,
            "Tried to get a int8 attribute as a uint32");
     expect(bn_binding_get_uint32(address, 129, nullptr, &value), LC_NOT_FOUND, "Error code 14004");

@@ -86,6 +86,7 @@ struct server {
 TEST(client, requests_and_their_results) {
     server peer;
     add(peer.held, "/a", "one");
+    EXPECT_EQ(mdc_init(nullptr, nullptr, nullptr, nullptr, nullptr, &peer.client), LC_NULL);
     binding_owner binding;
     string_owner message;
     uint32_t code = 9, revision = 0;
@@ -118,6 +119,8 @@ TEST(client, requests_and_their_results) {
               0);
     EXPECT_EQ(peer.action, "/do");
     EXPECT_EQ(peer.names, (std::vector<std::string>{"x", "y"}));
+    ASSERT_EQ(mdc_send_action_with_bindings_str_va(peer.client, nullptr, nullptr, "/do", 0), 0);
+    EXPECT_TRUE(peer.names.empty());
     peer.silent = true;
     ASSERT_EQ(mdc_get_binding(peer.client, &code, nullptr, 0, &binding, "/a", nullptr), 0);
     EXPECT_EQ(binding.pointer, nullptr);
@@ -151,6 +154,7 @@ TEST(client, foreach_counts_successful_calls) {
     EXPECT_EQ(all.texts, "c=v;c=v;c=v;");
     EXPECT_EQ(mdc_foreach_binding_prequeried(bindings, "/a/*/c", nullptr, note, &some, &count), LC_BAD_TYPE);
     EXPECT_EQ(count, 1u);
+    EXPECT_EQ(mdc_foreach_binding_prequeried(nullptr, "/a", nullptr, note, &all, &count), LC_NULL);
 }
 
 } // namespace

@@ -246,6 +246,9 @@ TEST_F(Gcl, NamesAndNumbersThatAreRefused) {
     again.protocol = 1;
     EXPECT_EQ(gcl_register_body_protocol(client.instance, &again), LC_ASSERTION);
     EXPECT_EQ(log.count("Already have registered body handler for proto 1"), 1);
+    gcl *nothing = nullptr;
+    EXPECT_EQ(gcl_deinit(&nothing), LC_OK);
+    EXPECT_EQ(gcl_init(&nothing, nullptr, nullptr), LC_NULL);
     gcl_session *session = nullptr;
     for (const char *name : {"a-b", "abcdefghijklmnopqrst"}) {
         EXPECT_EQ(gcl_session_client_new(client.instance, name, nullptr, 0, &session), LC_GENERIC);
@@ -307,6 +310,10 @@ TEST_F(Gcl, OverTheInternetProtocol) {
     std::thread other([&] { EXPECT_TRUE(provider.open_session()); });
     EXPECT_EQ(client.open(), LC_OK);
     other.join();
+    gcl_session *session = nullptr;
+    address.sin_family = AF_IPX;
+    EXPECT_EQ(gcl_session_client_new(client.instance, "wccpd", generic, length, &session), LC_GENERIC);
+    EXPECT_EQ(log.count("Unknown af 4"), 1);
 }
 
 // ---- The frame reader

@@ -257,7 +257,17 @@ TEST(Closed, StateEventsArePassedToTheProgram) {
     EXPECT_EQ(transported, 3);
 }
 
+// The texts of the engine show that of an address.
+TEST(Closed, AddressText) {
+    char buffer[46];
+    EXPECT_STREQ(get_addr_str(4, to_be32(0xFFFFFFFF), 0, buffer, 15), "") << "no room for the terminator";
+    EXPECT_STREQ(get_addr_str(6, to_be32(1), 0, buffer, sizeof buffer), "");
+}
+
 TEST_F(Netlink, TheThreadIsSmallAndTakesNoSignal) {
+    const int fd = g_qvif_skfd;
+    qvif_network_init_sockets();
+    EXPECT_EQ(g_qvif_skfd, fd) << "opened once";
     EXPECT_EQ(seen->links["lo"], "1/1") << "reported at the start";
 #ifndef WCCP_SANITIZED
     EXPECT_LE(seen->stack, 128u * 1024);

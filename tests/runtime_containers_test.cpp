@@ -279,7 +279,10 @@ TEST_F(HashTable, DuplicatesMissesAndFailingFrees) {
     EXPECT_TRUE(value == &two && freed == 1 && table->entry_count == 1);
     table->refuse_duplicates = 1;
     EXPECT_EQ(ht_insert(table, "k", -1, &one), LC_EXISTS);
-    status = LC_IO_ERROR; // the entry is gone all the same
+    table->refuse_duplicates = 0;
+    status = LC_IO_ERROR; // the old entry is gone all the same
+    EXPECT_TRUE(ht_insert(table, "k", -1, &one) == LC_GENERIC && freed == 2 && table->entry_count == 0);
+    EXPECT_EQ(ht_insert(table, "k", -1, &one), LC_OK);
     EXPECT_TRUE(ht_delete(table, "k", -1) == LC_GENERIC && table->entry_count == 0);
 }
 

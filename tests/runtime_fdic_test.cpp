@@ -69,7 +69,7 @@ TEST_F(FdicList, EachChangeIsReportedOnce) {
     expect("5- ", fdic_event_delete_timer(list, 5));
     expect("", fdic_event_delete_timer(list, 5), LC_NOT_FOUND);
     for (const char *line : {"update event fd with bad id 1", "delete event timer with bad id 5",
-                             "EVENT: adding for 0x10: -1 ms"})
+                             "EVENT: adding for 0x10: -1 ms", "EVENT: deleting for 0x10: 60 ms"})
         EXPECT_EQ(log.count(line), 1) << line;
 }
 
