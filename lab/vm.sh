@@ -10,7 +10,7 @@
 #
 #   WCCP_BIN    where the programs are (default: build/release/bin)
 #   VM_LIMIT    seconds after which the machine is ended (default 330)
-#   LAB_PLANE   of tunneld (default kernel); LAB_SIDE_BY_SIDE: cases at a time (default 2)
+#   LAB_PLANE   of tunneld (default kernel); LAB_SIDE_BY_SIDE: cases at a time (default 2); LAB_PATIENCE: see topology.sh
 #   VM_ACCEL    kvm or tcg (default: kvm where that boots, which is tried once; otherwise tcg)
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
@@ -103,7 +103,8 @@ prepare_project() { # ARGUMENTS...
     for name in "${programs[@]}"; do cp "$WCCP_BIN/$name" "$tree/build/release/bin/" || die "no $name"; done
     cp "$WCCP_BIN"/../lib/lib{qvcommondyn,fast_clock}.so "$tree/build/release/lib/" || die "no libraries"
     if [ "${1-}" = -- ]; then printf '%q ' "${@:2}" >"$tree/command"; else
-        printf '%q ' env "LAB_PLANE=${LAB_PLANE-}" "LAB_SIDE_BY_SIDE=${LAB_SIDE_BY_SIDE-}" lab/vm/cases.sh "$@" >"$tree/command"
+        printf '%q ' env "LAB_PLANE=${LAB_PLANE-}" "LAB_SIDE_BY_SIDE=${LAB_SIDE_BY_SIDE-}" \
+            "LAB_PATIENCE=${LAB_PATIENCE-}" lab/vm/cases.sh "$@" >"$tree/command"
     fi
     make_disk "$tree" "$run/project.img" 256M || die "no disk for the project"
     rm -rf "$tree"

@@ -26,7 +26,7 @@ fetches() { # JQ [OPTIONS OF lab_fetch]
     jq -e "$1" <<<"$out" >/dev/null || { lab_ctl r1 traffic; die "fetches are not $1: $out"; } >&2
 }
 fetches_within() { # SECONDS JQ [OPTIONS OF lab_fetch]
-    lab_wait "$1" "$2" eval "lab_fetch c1 --timeout 1 ${*:3} || true" || die "fetches"
+    lab_wait "$1" "$2" eval "lab_fetch c1 --timeout $LAB_PATIENCE ${*:3} || true" || die "fetches"
 }
 # One group for packets from the clients, one for packets to them.
 both_groups="$(lab_group 51 10.0.0.1 hash_src_ip=true)
