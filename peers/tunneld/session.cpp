@@ -524,10 +524,7 @@ void send_due_requests(mgmt_link *link) {
     const int64_t now = lt_monotonic_ms();
     if (may_ask(&link->configuration, link->read_at_ms, now)) {
         link->read_at_ms = NEVER;
-        if (!send_walks(link,
-                        {NODE_GROUP_CONFIG, NODE_INTERCEPT_CONFIG, NODE_BYPASS_CONFIG, NODE_ACCEPT_CONFIG,
-                         NODE_PROTECTION_CONFIG, NODE_DRAINS},
-                        bn_qf_subtree, &link->configuration))
+        if (!send_walks(link, list_configuration_roots(), bn_qf_subtree, &link->configuration))
             link->read_at_ms = now + RETRY_MS;
     }
     if (!may_ask(&link->routers, now, now) || !may_ask(&link->owners, now, now) ||

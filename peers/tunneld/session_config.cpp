@@ -287,6 +287,13 @@ constexpr struct {
 };
 } // namespace
 
+std::vector<std::string> list_configuration_roots() {
+    std::vector<std::string> roots;
+    for (const auto &reader : readers)
+        roots.emplace_back(reader.root);
+    return roots;
+}
+
 configured_view read_configuration(const std::vector<event_field> &nodes,
                                    std::vector<std::string> *out_complaints) {
     reading self;

@@ -23,6 +23,8 @@ bool parse_ports(const std::string &text, std::vector<port_range> *out);
 bool parse_prefix(const std::string &text, ip_prefix *out);
 bool parse_address(const std::string &text, uint32_t *out);
 
+// The nodes whose subtrees read_configuration() takes.
+std::vector<std::string> list_configuration_roots();
 // Fills in groups without `local` and `routers`. A bad value, or one that exceeds a bound, is ignored with a
 // complaint of one line. An intercept whose ports, protocol or proxy port are bad or missing is left out: a
 // default could intercept traffic that nobody wants intercepted.
