@@ -28,7 +28,7 @@ T *find_nth_or_log(T *head, uint32_t place, const char *absent, int id) {
     for (uint32_t i = 1; head; head = head->next, i++)
         if (i == place)
             return head;
-    QV_LOG(LC_LOG_DEBUG, absent, id, static_cast<int>(place));
+    QV_LOG(LC_LOG_INFO, absent, id, static_cast<int>(place));
     return nullptr;
 }
 
@@ -122,7 +122,7 @@ int wccp_get_grp_appliance_info(int id, wccp_grp_appliance_info *info) {
 wccp_sending_router *wccp_find_router_instance(int id, uint32_t router_num) {
     const wccp_service_group *group = wccp_find_group(id);
     if (!group) {
-        QV_LOG(LC_LOG_DEBUG, "WCCP GRP %d: find router: cannot find group id %d", id, id);
+        QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find router: cannot find group id %d", id, id);
         return nullptr;
     }
     return find_nth_or_log(group->sending_routers, router_num,
@@ -175,7 +175,7 @@ int wccp_get_router_appliance_info(wccp_router_appliance_info *info) {
             appliance->buckets_total ? appliance->buckets_assigned * 100u / appliance->buckets_total : 0;
         return 0;
     }
-    QV_LOG(LC_LOG_DEBUG, "WCCP GRP %d: find appliance: appliance id %s not present in router %d", id,
+    QV_LOG(LC_LOG_INFO, "WCCP GRP %d: find appliance: appliance id %s not present in router %d", id,
            addr_text(info->ipa).s, static_cast<int>(info->router_num));
     return 1;
 }
