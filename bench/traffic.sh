@@ -18,7 +18,7 @@
 # segments on their way to a socket. The `packets` take the same way and are forwarded by the appliance, plain or, for
 # redirected ones, as `rest` says; they are counted when they leave it. The client sends as many as it can, and all of
 # the way is processor 1's work: with a processor of its own the client would send more than the appliance can take.
-# The packets of one flow can be merged, those of 4096 flows in turn cannot. Processor time is all of processor 1,
+# Of one flow they can be merged, of 4096 flows in turn they cannot; with the shortcut of the kernel that makes no difference. Processor time is all of processor 1,
 # interrupts included, without idling; what the router does for GRE is not in it, except with `packets`. Rounds alternate,
 # the result is the median of their ratios. A round during which others had more than 5 % of processor 1 is repeated.
 #   TRAFFIC_SECONDS    of a round (4)          TRAFFIC_ROUNDS    (5)

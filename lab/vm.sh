@@ -21,7 +21,8 @@ export LC_ALL=C TMPDIR=$run PATH=$PATH:/usr/sbin:/sbin
 
 programs=(wccpd mgmtd mgmtctl tunneld wccp_router)
 packages=(base-files dash bash coreutils sed grep mawk findutils diffutils util-linux mount procps iproute2 nftables jq
-    haproxy curl kmod busybox-static libgcc-s1 libevent-core-2.1-7 libnuma1 libmd0 libnl-route-3-200 libnftables1)
+    haproxy curl kmod busybox-static libgcc-s1 libevent-core-2.1-7 libnuma1 libmd0 libnl-route-3-200 libnftables1
+    libbpf1)
 kernel=linux-image-cloud-amd64 # has NVMe and ext4 built in: it needs no initial file system
 modules=(kernel/{net,lib,crypto,arch/x86/crypto} kernel/drivers/net/{veth,tun,dummy,ifb}.ko)
 

@@ -2,11 +2,11 @@
 # install-deps.sh WHAT...: installs the missing packages for `build`, `lab`, `capture`, `test`, `browser`, `package`, `vm`, on
 # Debian 12, as root or with sudo. `metrics` unpacks promtool and prometheus into build/tools: the package would start a server.
 set -eu
-build="g++ cmake ninja-build pkg-config libevent-dev libnuma-dev libmd-dev libnl-route-3-dev libnftables-dev libcli11-dev nlohmann-json3-dev"
+build="g++ cmake ninja-build pkg-config libevent-dev libnuma-dev libmd-dev libnl-route-3-dev libnftables-dev libbpf-dev clang-14 libcli11-dev nlohmann-json3-dev"
 lab="iproute2 util-linux procps mount jq nftables haproxy curl"
 package="debhelper dpkg-dev lintian systemd"
 capture="tcpdump tshark"
-test="libgtest-dev libbenchmark-dev clang-14 lld libclang-rt-14-dev clang-format-14 clang-tidy-14 git $capture"
+test="libgtest-dev libbenchmark-dev lld libclang-rt-14-dev clang-format-14 clang-tidy-14 git $capture"
 browser="chromium" # 110 MB to download
 vm="qemu-system-x86 e2fsprogs"
 wanted=

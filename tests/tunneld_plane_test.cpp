@@ -31,6 +31,8 @@
 #include "peers/tunneld/netlink.h"
 #include "peers/tunneld/passing.h"
 #include "peers/tunneld/plane.h"
+#include "peers/tunneld/user_shortcut.h"
+#include "peers/tunneld/user_tun.h"
 #include "peers/tunneld/wanted_state.h"
 
 namespace {
@@ -455,6 +457,32 @@ int send_partial() {
     return sent ? 0 : 1;
 }
 
+// Three packets that may take the shortcut, of 36, 37 and 38 bytes, and some that may not.
+int send_for_shortcut() {
+    const bytes redirect = {0x80, 51, 7, 200};
+    const auto made = [](uint8_t protocol, size_t payload) {
+        bytes packet = make_packet(protocol, 1, payload);
+        ip(&packet)->destination = to_be32(0xc0a80901);
+        mend(&packet);
+        return packet;
+    };
+    const bytes plain = made(PROTOCOL_UDP, 8);
+    bytes corrupt = plain, fragment = plain, cut = plain;
+    ip(&corrupt)->ttl--;
+    ip(&fragment)->fragment = to_be16(0x2000);
+    mend(&fragment);
+    cut.pop_back();
+    for (const bytes &content : {corrupt, fragment, cut, made(PROTOCOL_TCP, 8)})
+        send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, content, redirect));
+    send_gre(ROUTER, wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, plain));
+    send_gre(ROUTER, wrap(0, 0x86dd, plain));
+    send_gre(STRANGER, wrap(0, GRE_TYPE_IPV4, plain));
+    send_gre(ROUTER, wrap(0, GRE_TYPE_IPV4, plain));
+    send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 9)));
+    send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 10), redirect));
+    return 0;
+}
+
 // Echoes everything on one connection.
 int echo_once() {
     const int listener = socket(AF_INET, SOCK_STREAM, 0), on = 1;
@@ -519,6 +547,8 @@ int child_main(int commands, int answers) {
             result = send_by_hand();
         else if (command == 'c')
             result = send_partial();
+        else if (command == 's')
+            result = send_for_shortcut();
         else if (command == 'p')
             result = !user_plane.open(&error) ||
                      !user_plane.make_link("wccp0", {1, ROUTER, APPLIANCE}, &index, &error) ||
@@ -680,6 +710,44 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_returns_packets) {
     ASSERT_TRUE(user_plane.make_link("wccp0", wish, &again, &error)) << error;
     EXPECT_EQ(again, if_nametoindex("wccp0"));
     shell("ip link set wccp0 up");
+}
+
+TEST_F(live_plane, only_valid_udp_of_a_link_takes_the_shortcut) {
+    packet_shortcut shortcut;
+    tun_device tun;
+    std::string error;
+    if (!shortcut_open(&shortcut, &error))
+        GTEST_SKIP() << error;
+    ASSERT_TRUE(tun_open("wccp0", &tun, &error)) << error;
+    shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up");
+    for (const char *path : {"all/rp_filter", "wccp0/rp_filter"})
+        std::ofstream("/proc/sys/net/ipv4/conf/" + std::string(path)) << 0;
+    shortcut_follow_devices(&shortcut);
+    EXPECT_EQ(shortcut.devices.size(), 2u); // va, wccp0
+    shortcut_add_link(&shortcut, APPLIANCE, ROUTER, tun.index);
+    const int datagrams = socket(AF_INET, SOCK_DGRAM, 0);
+    const sockaddr_in any = address_of(INADDR_ANY, 80);
+    ASSERT_EQ(bind(datagrams, reinterpret_cast<const sockaddr *>(&any), sizeof any), 0);
+    for (const bool known : {true, false}) {
+        order('s');
+        ASSERT_TRUE(answered());
+        for (const ssize_t length : {8, 9, 10}) {
+            pollfd comes = {datagrams, POLLIN, 0};
+            bytes got(100);
+            ASSERT_EQ(poll(&comes, 1, known ? 3000 : 100), known);
+            if (known) {
+                EXPECT_EQ(recv(datagrams, got.data(), got.size(), 0), length);
+            }
+        }
+        const shortcut_link taken = shortcut_count(shortcut, APPLIANCE, ROUTER);
+        EXPECT_EQ(taken.packets, known ? 3u : 0u);
+        EXPECT_EQ(taken.bytes, known ? 36u + 37 + 38 : 0u);
+        EXPECT_EQ(taken.redirect_headers, known ? 1u : 0u);
+        shortcut_drop_link(&shortcut, APPLIANCE, ROUTER);
+    }
+    close(datagrams);
+    close(tun.fd);
+    shortcut_close(&shortcut);
 }
 
 TEST_F(live_plane, two_that_take_each_other_for_the_owner_exchange_a_packet_once) {

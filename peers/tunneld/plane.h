@@ -80,6 +80,8 @@ struct data_plane {
     // Sets which packets are passed on by the bucket in their redirect header. Null if the plane can't see
     // it.
     void (*set_passing)(const passing_table &table) = nullptr;
+    // Called every few seconds: the host may have other devices now. Null if that makes no difference.
+    void (*follow_devices)() = nullptr;
 };
 extern const data_plane kernel_plane; // GRE links of the kernel
 extern const data_plane user_plane;   // a packet ring, and a TUN device for each tunnel

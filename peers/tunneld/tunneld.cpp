@@ -331,6 +331,8 @@ void do_periodic_work(tunneld *daemon, int64_t now) {
     reconcile_now(daemon);
     if (now >= daemon->look_at_counters_ms) {
         note_occurrences(daemon);
+        if (daemon->plane->follow_devices)
+            daemon->plane->follow_devices();
         daemon->look_at_counters_ms = now + OCCURRENCE_LOOK_MS;
     }
     if (now >= daemon->alive_at_ms && service_watchdog_ms() >= 0) {

@@ -1,6 +1,7 @@
 // The data plane `user`. Its thread takes GRE packets out of a packet ring, checks them, and writes what they
 // carry into the TUN device of their tunnel, with segments of a flow merged into large ones. The packets that
-// it reads from a TUN device are split again and sent to the router through a raw socket.
+// it reads from a TUN device are split again and sent to the router through a raw socket. UDP packets take a
+// shortcut in the kernel where there is one.
 //
 // The thread holds the lock while it works on a batch of packets, but not while it waits. Under load it would
 // take the lock again at once: other threads therefore announce that they want it, and the thread lets them
@@ -33,7 +34,9 @@
 #include "peers/tunneld/plane.h"
 #include "peers/tunneld/redirect_memory.h"
 #include "peers/tunneld/user_ring.h"
+#include "peers/tunneld/user_shortcut.h"
 #include "peers/tunneld/user_tun.h"
+#include "runtime/logging.h"
 
 user_plane_options user_plane_settings;
 
@@ -96,6 +99,7 @@ struct user_state {
     int epoll = -1; // of the TUN devices and `wake`
     int wake = -1;  // readable when the thread is to stop
     packet_ring ring;
+    packet_shortcut shortcut; // of the main thread
     std::thread thread;
     // The thread's own:
     coalescer merger = {};
@@ -406,11 +410,21 @@ void close_user_plane() {
         (void)!write(state->wake, &one, sizeof one);
         state->thread.join();
     }
+    shortcut_close(&state->shortcut);
     ring_close(&state->ring);
     for (const int fd : {state->epoll, state->wake})
         if (fd >= 0)
             close(fd);
     state.reset();
+}
+
+// With --return-redirect, the redirect header of every packet has to be remembered.
+void open_shortcut(user_state *plane) {
+    std::string why_not = "redirect headers are returned";
+    if (!user_plane_settings.redirect_header && shortcut_open(&plane->shortcut, &why_not))
+        LC_LOG(LC_LOG_INFO, "UDP packets take the shortcut in the kernel");
+    else
+        LC_LOG(LC_LOG_INFO, "No shortcut for UDP packets: %s", why_not.c_str());
 }
 
 bool open_user_plane(std::string *out_error) {
@@ -426,7 +440,9 @@ bool open_user_plane(std::string *out_error) {
     opened = opened && ring_open(&state->ring, out_error) &&
              watch_descriptor(state.get(), state->wake, WAKE_SERIAL, out_error) &&
              start_thread(state.get(), out_error);
-    if (!opened)
+    if (opened)
+        open_shortcut(state.get());
+    else
         close_user_plane();
     return opened;
 }
@@ -472,8 +488,11 @@ owned_link take_link_out(user_state *plane, const std::string &name) {
     owned_link link = std::move(found->second);
     const uint64_t ends = key_of_ends(link->wish.local, link->wish.remote);
     auto &by_ends = link->wish.kind == link_kind::passing ? plane->passing_by_ends : plane->by_ends;
-    if (const auto same = by_ends.find(ends); same != by_ends.end() && same->second == link.get())
+    if (const auto same = by_ends.find(ends); same != by_ends.end() && same->second == link.get()) {
         by_ends.erase(same);
+        if (link->wish.kind != link_kind::passing)
+            shortcut_drop_link(&plane->shortcut, link->wish.local, link->wish.remote);
+    }
     plane->by_serial.erase(link->serial);
     plane->links.erase(found);
     return link;
@@ -507,11 +526,14 @@ bool make_user_link(const std::string &name, const link_wish &wish, uint32_t *ou
     if ((carries && !open_raw_socket(wish, &link->out, out_error)) || !tun_open(name, &link->tun, out_error))
         return false;
     *out_index = link->tun.index;
+    shortcut_follow_devices(&plane->shortcut);
     const guest_guard guard(plane);
     if (!watch_descriptor(plane, link->tun.fd, link->serial, out_error))
         return false;
     plane->by_serial[link->serial] = link.get();
     (carries ? plane->by_ends : plane->passing_by_ends)[key_of_ends(wish.local, wish.remote)] = link.get();
+    if (carries)
+        shortcut_add_link(&plane->shortcut, wish.local, wish.remote, link->tun.index);
     plane->links[name] = std::move(link);
     return true;
 }
@@ -533,9 +555,20 @@ void read_user_counters(plane_counters *inout) {
         const uint64_t fragments = out.fragments;
         out = link->counters;
         out.fragments = fragments;
+        if (link->wish.kind == link_kind::passing)
+            continue;
+        const shortcut_link taken = shortcut_count(state->shortcut, link->wish.local, link->wish.remote);
+        out.packets_in += taken.packets;
+        out.bytes_in += taken.bytes;
+        out.redirect_headers += taken.redirect_headers;
     }
     inout->refused_sources = state->refused_sources;
     memcpy(inout->refused, state->refused, sizeof inout->refused);
+}
+
+void follow_user_devices() {
+    if (state)
+        shortcut_follow_devices(&state->shortcut);
 }
 
 void set_user_passing(const passing_table &table) {
@@ -558,5 +591,6 @@ bool probe_user_plane(std::string *out_why_not) {
 
 } // namespace
 
-const data_plane user_plane = {"user",         probe_user_plane, open_user_plane,    close_user_plane,
-                               make_user_link, drop_user_link,   read_user_counters, set_user_passing};
+const data_plane user_plane = {
+    "user",         probe_user_plane,   open_user_plane,  close_user_plane,   make_user_link,
+    drop_user_link, read_user_counters, set_user_passing, follow_user_devices};
