@@ -4,8 +4,6 @@
 
 #include <csignal>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -13,6 +11,7 @@
 #include "peers/mgmtctl/html_file.h"
 #include "peers/mgmtctl/show_draw.h"
 #include "peers/mgmtctl/show_texts.h"
+#include "tests/support/texts.h"
 
 namespace {
 const page_origin ORIGIN = {"cache1", "2026-11-25 14:09:55 +0000", "1.0.0", 1795615795};
@@ -78,15 +77,6 @@ size_t count_of(const std::string &text, const std::string &wanted) {
     return count;
 }
 
-bool has(const std::string &page, const std::string &text) {
-    return page.find(text) != std::string::npos;
-}
-
-std::string content_of(const std::string &path) {
-    std::ostringstream out;
-    out << std::ifstream(path).rdbuf();
-    return out.str();
-}
 } // namespace
 
 TEST(Html, InputIsEscaped) {
@@ -129,8 +119,7 @@ TEST(Html, InputIsEscaped) {
     shown.unreachable = evil;
     page += draw_page(shown, origin);
     EXPECT_GT(count_of(page, "&quot;&#39;&gt;&lt;script&gt;&amp;amp;"), 100u);
-    EXPECT_FALSE(has(page, "<script") || has(page, "'><") || has(page, ";&amp;\""));
-    EXPECT_EQ(count_of(page, "\"'"), 0u);
+    EXPECT_TRUE(lacks(page, "<script", "'><", ";&amp;\"", "\"'"));
 }
 
 TEST(Html, UnknownValuesAreMarked) {
@@ -141,17 +130,15 @@ TEST(Html, UnknownValuesAreMarked) {
     shown.groups.resize(1);
     shown.groups[0].configured = shown.groups[0].interface_set = true;
     shown.groups[0].routers_configured = 1;
-    shown.groups[0].routers.resize(1);
-    shown.groups[0].routers[0].address = shown.groups[0].routers[0].id = "10.0.0.1";
-    shown.groups[0].routers[0].connection = "unknown";
+    snapshot_router *router = &shown.groups[0].routers.emplace_back();
+    router->address = router->id = "10.0.0.1";
+    router->connection = "unknown";
     std::string page = draw_page(shown, ORIGIN);
-    for (const char *text :
-         {"<dt>Alarms</dt><dd><span class=\"badge unknown\">",
-          "<dt>Flows</dt><dd><span class=\"badge unknown\">", "tunneld has no session",
-          "<code>wccpd-silent</code>", "cache1", "2026-11-25 14:09:55 +0000", "mgmtctl 1.0.0"})
-        EXPECT_TRUE(has(page, text)) << text;
-    for (const char *text : {"nothing heard", "none reported", "no router has", "Nothing needs", "none:"})
-        EXPECT_FALSE(has(page, text)) << text;
+    EXPECT_TRUE(contains(page, "<dt>Alarms</dt><dd><span class=\"badge unknown\">",
+                         "<dt>Flows</dt><dd><span class=\"badge unknown\">", "tunneld has no session",
+                         "<code>wccpd-silent</code>", "cache1", "2026-11-25 14:09:55 +0000",
+                         "mgmtctl 1.0.0"));
+    EXPECT_TRUE(lacks(page, "nothing heard", "none reported", "no router has", "Nothing needs", "none:"));
 
     // Another appliance is designated; one weight has not been reported.
     shown = good_snapshot({good_group(51)});
@@ -159,9 +146,9 @@ TEST(Html, UnknownValuesAreMarked) {
     shown.groups[0].wanted = {};
     shown.groups[0].appliances[1].weight = -1;
     page = draw_page(shown, ORIGIN);
-    EXPECT_TRUE(has(page, "only the designated appliance knows it"));
-    EXPECT_TRUE(has(page, "10.0.1.1</td><td><span class=\"badge unknown\">"));
-    EXPECT_FALSE(has(page, "as wanted"));
+    EXPECT_TRUE(contains(page, "only the designated appliance knows it",
+                         "10.0.1.1</td><td><span class=\"badge unknown\">"));
+    EXPECT_TRUE(lacks(page, "as wanted"));
 }
 
 TEST(Html, GroupsThatNeedAttentionAreUnfoldedAndFirst) {
@@ -170,7 +157,7 @@ TEST(Html, GroupsThatNeedAttentionAreUnfoldedAndFirst) {
         groups.push_back(good_group(id));
     snapshot shown = good_snapshot(groups);
     std::string page = draw_page(shown, ORIGIN);
-    EXPECT_TRUE(has(page, "<h1>Nothing needs attention</h1>"));
+    EXPECT_TRUE(contains(page, "<h1>Nothing needs attention</h1>"));
     EXPECT_EQ(count_of(page, "<details>"), 6u);
 
     shown.groups[1].reasons.push_back({"password-mismatch", "10.0.0.1", "", "", "", 4, 70000, 3000});
@@ -179,11 +166,11 @@ TEST(Html, GroupsThatNeedAttentionAreUnfoldedAndFirst) {
         {196638, "adjacency", "eth0:grp:6", "raised", "2026/11/25 00:10:11", "wccpd-1", 6});
     shown.alarms_total = 1;
     page = draw_page(shown, ORIGIN);
-    EXPECT_TRUE(has(page, "<h1>3 of 6 groups need attention</h1>"));
+    EXPECT_TRUE(contains(page, "<h1>3 of 6 groups need attention</h1>",
+                         "10.0.0.1 signs its messages with another password"));
     EXPECT_EQ(count_of(page, "<details open>"), 3u);
     EXPECT_EQ(count_of(page, "<details>"), 3u);
     EXPECT_LT(page.find("id=\"group-6\""), page.find("id=\"group-1\""));
-    EXPECT_TRUE(has(page, "10.0.0.1 signs its messages with another password"));
 }
 
 TEST(Html, ATableIsComparedBucketByBucket) {
@@ -195,11 +182,10 @@ TEST(Html, ATableIsComparedBucketByBucket) {
         group.tables[1].owners[i] = i < 44 ? -1 : 1;
     snapshot shown = good_snapshot({group});
     std::string page = draw_page(shown, ORIGIN);
-    for (const char *text :
-         {"16 buckets not as wanted", "title=\"bucket 40: nobody, wanted: A 10.0.1.0\"><i>-</i>",
-          "class=\"o1 other\" title=\"bucket 55: B 10.0.1.1, wanted: A 10.0.1.0\"><i>B</i>",
-          "aria-label=\"A 112, B 140, nobody 4\""})
-        EXPECT_TRUE(has(page, text)) << text;
+    EXPECT_TRUE(contains(page, "16 buckets not as wanted",
+                         "title=\"bucket 40: nobody, wanted: A 10.0.1.0\"><i>-</i>",
+                         "class=\"o1 other\" title=\"bucket 55: B 10.0.1.1, wanted: A 10.0.1.0\"><i>B</i>",
+                         "aria-label=\"A 112, B 140, nobody 4\""));
     const size_t legend = 4;
     EXPECT_EQ(count_of(page, "<i>"), 3 * 256u + 2 + legend);
     // With many groups, a run of buckets has one title.
@@ -215,14 +201,17 @@ TEST(Html, ATableIsComparedBucketByBucket) {
 }
 
 TEST(Html, TheWantedTableIsReadFromTheAssignmentText) {
-    snapshot_group group;
-    take_assignment_text("\tAppliance ip               : 10.0.0.101\n\tHash/mask allotment        : 50 % \n"
-                         "\t                           : 0x00000000 00000000 00000000 00000000\n"
-                         "\t                           : 0x00000000 00000000 00000000 ffff0001\n"
-                         "\tAppliance ip               : 10.0.0.102\n\tHash/mask allotment        : 50 % \n"
-                         "\t                           : 0x80000000 00000000 00000000 00000000\n"
-                         "\t                           : 0x00000000 00000000 00000000 00000000\n"
-                         "\tReceived router allocation\n",
+    const auto appliance = [](const std::string &address) {
+        return "\tAppliance ip               : " + address + "\n\tHash/mask allotment        : 50 % \n";
+    };
+    const auto words = [](const std::string &four) {
+        return "\t                           : " + four + "\n";
+    };
+    const std::string zeros = "00000000 00000000 00000000", end = "\tReceived router allocation\n";
+    snapshot_group group, by_mask;
+    take_assignment_text(appliance("10.0.0.101") + words("0x00000000 " + zeros) +
+                             words("0x" + zeros + " ffff0001") + appliance("10.0.0.102") +
+                             words("0x80000000 " + zeros) + words("0x00000000 " + zeros) + end,
                          &group);
     ASSERT_EQ(group.wanted.owners.size(), 256u);
     EXPECT_EQ(group.wanted.owners[0], 0);
@@ -230,17 +219,16 @@ TEST(Html, TheWantedTableIsReadFromTheAssignmentText) {
     EXPECT_EQ(group.wanted.owners[16], 0);
     EXPECT_EQ(group.wanted.owners[255], 1);
 
-    std::string mask = "\tAppliance ip               : 10.0.0.101\n\tHash/mask allotment        : 50 % \n"
-                       "\t         0 : 0x00000003 0x00000000 0x0000   0x0000\n";
+    std::string rows = "\t         0 : 0x00000003 0x00000000 0x0000   0x0000\n";
     for (const char *row : {"0 : 0x00000000 0x00000000 0x0000   0x0000   10.0.0.101",
                             "1 : 0x00000001 0x00000000 0x0000   0x0000   10.0.0.102",
                             "2 : 0x00000002 0x00000000 0x0000   0x0000   0.0.0.0",
                             "3 : 0x00000003 0x00000000 0x0000   0x0000   10.0.0.101"})
-        mask += std::string("\t         ") + row + "\n";
-    snapshot_group by_mask;
-    take_assignment_text(mask + "\tReceived router allocation\n\tRouter id                  : 10.0.0.1\n"
-                                "\tAppliance ip               : 10.0.0.102\n"
-                                "\tRxed value buckets (0-127) : 0x00000002 00000000 00000000 00000000\n",
+        rows += std::string("\t         ") + row + "\n";
+    take_assignment_text(appliance("10.0.0.101") + rows + end +
+                             "\tRouter id                  : 10.0.0.1\n"
+                             "\tAppliance ip               : 10.0.0.102\n"
+                             "\tRxed value buckets (0-127) : 0x00000002 00000000 00000000 00000000\n",
                          &by_mask);
     EXPECT_TRUE(by_mask.wanted.mask);
     EXPECT_EQ(by_mask.wanted.owners, (std::vector<int>{0, 1, -1, 0}));
@@ -256,25 +244,22 @@ TEST(Html, AFileIsReplacedAsAWholeOrNotAtAll) {
     std::string reason;
     umask(027);
     ASSERT_TRUE(write_page_file(file, "old", &reason)) << reason;
-    struct stat about;
-    ASSERT_EQ(stat(file.c_str(), &about), 0);
-    EXPECT_EQ(about.st_mode & 07777, 0640u);
+    const auto mode = [&] { return std::filesystem::status(file).permissions(); };
+    EXPECT_EQ(mode(), std::filesystem::perms(0640));
     chmod(file.c_str(), 0604);
     std::filesystem::create_symlink("page.html", link);
     ASSERT_TRUE(write_page_file(link, "new", &reason)) << reason;
     EXPECT_TRUE(std::filesystem::is_symlink(link));
-    ASSERT_EQ(stat(file.c_str(), &about), 0);
-    EXPECT_EQ(about.st_mode & 07777, 0604u);
+    EXPECT_EQ(mode(), std::filesystem::perms(0604));
 
     signal(SIGXFSZ, SIG_IGN);
-    rlimit before, small;
+    rlimit before;
     getrlimit(RLIMIT_FSIZE, &before);
-    small = before;
-    small.rlim_cur = 1000;
+    const rlimit small = {1000, before.rlim_max};
     setrlimit(RLIMIT_FSIZE, &small);
     EXPECT_FALSE(write_page_file(file, std::string(5000, 'x'), &reason));
     setrlimit(RLIMIT_FSIZE, &before);
     EXPECT_EQ(reason, "File too large");
-    EXPECT_EQ(content_of(file), "new");
+    EXPECT_EQ(text_of_file(file), "new");
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator(directory), {}), 2) << "a file is left over";
 }

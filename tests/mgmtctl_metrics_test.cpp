@@ -1,8 +1,6 @@
 // Metrics: the samples of states, in both formats, and the names that documents, alert rules, the dashboard
 // and the engine share with the table of metrics.
 #include <algorithm>
-#include <fstream>
-#include <iterator>
 #include <regex>
 #include <set>
 
@@ -11,11 +9,12 @@
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/metrics.h"
 #include "peers/nodes/schema.h"
+#include "tests/support/texts.h"
 
 static const std::string STATES = "/qv/wccpd/wccp/srv_grp/state";
 
 static metric_source answered_by(const std::vector<ctl_binding> &nodes) {
-    return [&nodes](ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out) {
+    return [nodes](ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out) {
         for (const ctl_binding &node : nodes)
             for (const std::string &name : names)
                 if (node.name == name ? walk != ctl_walk::children
@@ -25,11 +24,11 @@ static metric_source answered_by(const std::vector<ctl_binding> &nodes) {
     };
 }
 
-static std::string text_of(const metric_lines &samples, metric_format format) {
-    std::string out;
-    for (const std::string &piece : metrics_text(samples, format))
-        out += piece;
-    return out;
+// The text of what is gathered; gathering has to end like this.
+static std::string metrics_of(const metric_source &source, metric_format format, bool complete = true) {
+    metric_lines samples;
+    EXPECT_EQ(gather_metrics(source, &samples), complete);
+    return joined(metrics_text(samples, format), "");
 }
 
 // Only numbers become values, texts cannot leave their labels, and a daemon that is gone is reported as down.
@@ -57,9 +56,7 @@ TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
         {NODE_ALARMS_RAISED "/196638/a\"b\\\\c", "string", "text"},
         {NODE_PROCESSES "/wccpd", "string", "running"},
         {NODE_PROCESSES "/wccpd/restarts", "uint32", "2"}};
-    metric_lines samples;
-    ASSERT_TRUE(gather_metrics(answered_by(known), &samples));
-    const std::string modern = "\n" + text_of(samples, metric_format::openmetrics);
+    const std::string modern = "\n" + metrics_of(answered_by(known), metric_format::openmetrics);
     for (const char *line :
          {"wccp_build_info{version=\"1.0.0\"} 1", "# TYPE wccp_build info", "wccp_rx_failures_total 9",
           "wccp_interface_link_downs_total{interface=\"eth0\"} 4",
@@ -74,37 +71,36 @@ TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
           "wccp_proxy_state_seconds{group=\"51\"} 1.500", "wccp_intercept_weight_ratio{group=\"51\"} 0.05",
           "wccp_protection_packets_total{appliance=\"10.0.0.102\",way=\"passed\"} 3",
           "wccp_process_restarts_total{process=\"wccpd\"} 2", "wccp_daemon_up{daemon=\"tunneld\"} 1"})
-        EXPECT_NE(modern.find("\n" + std::string(line) + "\n"), std::string::npos)
-            << line << " in " << modern;
-    for (const char *none :
-         {"pending_acks{", "Bad", "nothing", "wccp_proxy_up{", "router=\"10.0.0.2\"", "interface=\"a\""})
-        EXPECT_EQ(modern.find(none), std::string::npos) << none;
-    EXPECT_NE(modern.find("source=\"a\\\"b"), std::string::npos) << modern;
+        EXPECT_TRUE(contains(modern, "\n" + std::string(line) + "\n"));
+    EXPECT_TRUE(lacks(modern, "pending_acks{", "Bad", "nothing", "wccp_proxy_up{", "router=\"10.0.0.2\"",
+                      "interface=\"a\""));
+    EXPECT_TRUE(contains(modern, "source=\"a\\\"b"));
     EXPECT_TRUE(modern.ends_with("\n# EOF\n"));
-    EXPECT_NE(text_of(samples, metric_format::text).find("# TYPE wccp_group_rx_icus_total counter\n"),
-              std::string::npos);
-
-    const std::vector<ctl_binding> empty;
-    samples = {};
-    ASSERT_TRUE(gather_metrics(answered_by(empty), &samples));
-    EXPECT_NE(text_of(samples, metric_format::text).find("wccp_daemon_up{daemon=\"wccpd\"} 0\n"),
-              std::string::npos);
-    samples = {};
+    EXPECT_TRUE(contains(metrics_of(answered_by(known), metric_format::text),
+                         "# TYPE wccp_group_rx_icus_total counter\n"));
+    EXPECT_TRUE(
+        contains(metrics_of(answered_by({}), metric_format::text), "wccp_daemon_up{daemon=\"wccpd\"} 0\n"));
     const auto silent = [](ctl_walk, const std::vector<std::string> &, ctl_reply *) { return false; };
-    EXPECT_FALSE(gather_metrics(silent, &samples));
-    EXPECT_EQ(text_of(samples, metric_format::text).find("wccp_daemon_up{daemon=\"mgmtd\"} 0\n"),
-              text_of(samples, metric_format::text).size() - 33);
+    EXPECT_TRUE(
+        metrics_of(silent, metric_format::text, false).ends_with("\nwccp_daemon_up{daemon=\"mgmtd\"} 0\n"));
 }
 
-static std::string text_of_file(const std::string &name) {
-    std::ifstream in(WCCP_SOURCE_DIR "/" + name);
-    return {std::istreambuf_iterator<char>(in), {}};
+static std::string text_of_source(const std::string &name) {
+    return text_of_file(WCCP_SOURCE_DIR "/" + name);
+}
+// All that the pattern's group of this number matches in a file; at least so many.
+static strings found_in(const std::string &name, const char *pattern, int group, size_t least) {
+    const std::string text = text_of_source(name);
+    const std::regex expression(pattern);
+    const strings found(std::sregex_token_iterator(text.begin(), text.end(), expression, group), {});
+    EXPECT_GE(found.size(), least) << name;
+    return found;
 }
 
 // The documents, the dashboard and the alert rules name metrics that exist, and each number of the engine has
 // one.
 TEST(Metrics, AreTheOnesThatOthersName) {
-    const std::string document = text_of_file("docs/metrics.md");
+    const std::string document = text_of_source("docs/metrics.md");
     std::set<std::string> names;
     for (const metric_family &family : metric_families) {
         const char *const kinds[] = {"gauge", "counter", "info"}, *const suffixes[] = {"", "_total", "_info"};
@@ -113,27 +109,16 @@ TEST(Metrics, AreTheOnesThatOthersName) {
         names.insert(name);
         const std::string row = "| `" + name + "` | " + kinds[kind] + " | " + std::string(family.labels) +
                                 (family.labels.empty() ? "| " : " | ") + std::string(family.help) + " |\n";
-        EXPECT_NE(document.find(row), std::string::npos) << row;
+        EXPECT_TRUE(contains(document, row));
     }
     for (const char *file : {"docs/metrics.md", "packaging/prometheus/wccp.rules.yml",
-                             "packaging/prometheus/wccp.dashboard.json"}) {
-        const std::string text = text_of_file(file);
-        const std::regex name("\\bwccp_[a-z_]+\\b");
-        size_t found = 0;
-        for (std::sregex_iterator at(text.begin(), text.end(), name), end; at != end; ++at, found++)
-            EXPECT_TRUE(names.contains(at->str())) << at->str() << " in " << file;
-        EXPECT_GT(found, 8u) << file;
-    }
-    for (const char *file : {"engine/wccp_query.cpp", "engine/wccp_metrics.cpp"}) {
-        const std::string text = text_of_file(file);
-        const std::regex row("\n    \\{\"([a-z_]+)\",");
-        size_t found = 0;
-        for (std::sregex_iterator at(text.begin(), text.end(), row), end; at != end; ++at, found++)
-            EXPECT_TRUE(names.contains("wccp_group_" + at->str(1)) ||
-                        names.contains("wccp_group_" + at->str(1) + "_total"))
-                << at->str(1) << " of " << file;
-        EXPECT_GT(found, 8u) << file;
-    }
+                             "packaging/prometheus/wccp.dashboard.json"})
+        for (const std::string &name : found_in(file, "\\bwccp_[a-z_]+\\b", 0, 9))
+            EXPECT_TRUE(names.contains(name)) << name << " in " << file;
+    for (const char *file : {"engine/wccp_query.cpp", "engine/wccp_metrics.cpp"})
+        for (const std::string &row : found_in(file, "\n    \\{\"([a-z_]+)\",", 1, 9))
+            EXPECT_TRUE(names.contains("wccp_group_" + row) || names.contains("wccp_group_" + row + "_total"))
+                << row << " of " << file;
 }
 
 // --- Nodes
@@ -142,11 +127,9 @@ TEST(Metrics, AreTheOnesThatOthersName) {
 TEST(Nodes, AreInTheDocuments) {
     static const std::set<std::string> ways = {"in",  "to_proxy",  "bypassed", "returned", "down",
                                                "own", "forwarded", "dropped",  "passed",   "overload"};
-    const std::string document = text_of_file("docs/states.md");
-    std::set<std::string> documented, wanted;
-    const std::regex row("\n\\| (/qv/(wccpd|tunneld)/[^ ]+) \\|");
-    for (std::sregex_iterator at(document.begin(), document.end(), row), end; at != end; ++at)
-        documented.insert(at->str(1));
+    const strings rows = found_in("docs/states.md", "\n\\| (/qv/(wccpd|tunneld)/[^ ]+) \\|", 1, 9);
+    const std::set<std::string> documented(rows.begin(), rows.end());
+    std::set<std::string> wanted;
     for (const auto *list : {&wccpd_state_nodes(), &tunneld_state_nodes()})
         for (const std::string node : *list) {
             std::string last = node.substr(node.rfind('/') + 1);
@@ -165,7 +148,7 @@ TEST(Nodes, AreInTheDocuments) {
         }
     EXPECT_EQ(documented, wanted);
 
-    const std::string configured = text_of_file("docs/mgmtd.md");
+    const std::string configured = text_of_source("docs/mgmtd.md");
     for (const schema_row &one : schema()) {
         const std::string last = one.parts.parts.back();
         EXPECT_TRUE(last == "*" || std::regex_search(configured, std::regex("/" + last + "[ ,]")))

@@ -2,7 +2,6 @@
 // are run.
 #include <csignal>
 #include <fstream>
-#include <sstream>
 
 #include <gtest/gtest.h>
 #include <poll.h>
@@ -14,10 +13,10 @@
 #include "peers/mgmtctl/notify_command.h"
 #include "peers/mgmtctl/notify_words.h"
 #include "runtime/ttime.h"
+#include "tests/support/texts.h"
 
 namespace {
 
-using strings = std::vector<std::string>;
 constexpr notify_kind ROLE = notify_kind::role, ALARM = notify_kind::alarm, HEALTH = notify_kind::health;
 
 struct Notify : testing::Test {
@@ -88,59 +87,55 @@ TEST_F(Notify, AComparisonFindsMissedChanges) {
 }
 
 TEST_F(Notify, ACommandGetsTheChangeAndItsReason) {
-    reason silent, loop, absent;
-    silent.code = "router-silent";
-    silent.group = 51;
-    silent.who = "10.0.0.1";
-    loop.code = "restart-loop";
-    loop.who = "tunneld";
-    loop.offered = "restarted 3 times in 9 s";
-    absent.code = "wccpd-absent";
+    reason silent = {.code = "router-silent", .group = 51, .who = "10.0.0.1"}, absent = {"wccpd-absent"};
+    reason loop = {.code = "restart-loop", .who = "tunneld", .offered = "restarted 3 times in 9 s"};
     for (reason *each : {&silent, &loop, &absent})
         fill_reason(reason_texts(), each);
-    const auto environment = [](const ctl_event &event, const std::vector<reason> &reasons) {
+    // Without the prefix of their names and the time; CAUSE and NEXT are those of the reason, if it is given.
+    const auto check = [](const ctl_event &event, const std::vector<reason> &reasons,
+                          const std::string &wanted, const reason *of = nullptr) {
         notify_change change = {{}, "", "before", "", 1000, 2};
         notify_state state;
         EXPECT_TRUE(read_notify_event(event, &change.subject, &state));
         change.state = state.state;
         change.detail = state.detail;
-        std::string out;
+        std::string found;
         for (const std::string &each : notify_environment(change, reasons))
             if (!each.starts_with("WCCP_TIME="))
-                out += each.substr(5) + "|";
-        return out;
+                found += each.substr(5) + "|";
+        EXPECT_EQ(found, wanted + (of ? "CAUSE=" + of->cause + "|NEXT=" + of->next + "|MERGED=2|" : ""));
     };
-    const auto alarm = [](const char *event, const char *type, const std::string &source) {
+    const auto role = [](const char *number) {
+        return ctl_event{EVENT_ROLE_CHANGE, {{"group", "string", "51"}, {"role", "uint32", number}}};
+    };
+    const auto alarm = [](const char *event, const char *type, const char *source) {
         return ctl_event{
             event,
             {{"alarm_type", "string", type}, {"param_3", "string", source}, {"comment", "string", "words"}}};
     };
-    EXPECT_EQ(
-        environment({EVENT_ROLE_CHANGE, {{"group", "string", "51"}, {"role", "uint32", "1"}}}, {silent}),
+    check(
+        role("1"), {silent},
         "KIND=role|GROUP=51|ALARM=|SOURCE=|STATE=BACKUP|PREVIOUS=before|REASON=router-silent|CAUSE=10.0.0.1 "
         "has stopped answering: no I-See-You for 40 s|NEXT=check the router, its password "
         "for the group, and the path to it|MERGED=2|");
-    EXPECT_TRUE(environment({EVENT_ROLE_CHANGE, {{"group", "string", "51"}, {"role", "uint32", "2"}}},
-                            {absent, silent})
-                    .find("REASON=wccpd-absent|") != std::string::npos);
-    EXPECT_EQ(environment({EVENT_PROXY_CHANGE,
-                           {{"group", "uint8", "7"},
-                            {"up", "bool", "false"},
-                            {"reason", "string", "no\nanswer\x1b[1m" + std::string(999, 'x')}}},
-                          {}),
-              "KIND=health|GROUP=7|ALARM=|SOURCE=|STATE=down|PREVIOUS=before|REASON=proxy-down|CAUSE=no?"
-              "answer?[1m" +
-                  std::string(242, 'x') +
-                  "|NEXT=start the proxy; mgmtctl intercept show 7 shows its state|MERGED=2|");
-    EXPECT_EQ(environment(alarm(EVENT_RAISE_ALARM, "196641", "tunneld"), {loop}),
-              "KIND=alarm|GROUP=|ALARM=restart-loop|SOURCE=tunneld|STATE=raised|PREVIOUS=before|REASON="
-              "restart-loop|"
-              "CAUSE=tunneld ends again and again: restarted 3 times in 9 s|NEXT=" +
-                  loop.next + "|MERGED=2|");
-    EXPECT_EQ(environment(alarm(EVENT_CLEAR_ALARM, "196638", "eth0:grp:51"), {silent}),
-              "KIND=alarm|GROUP=51|ALARM=adjacency|SOURCE=eth0:grp:51|STATE=cleared|PREVIOUS=before|REASON=|"
-              "CAUSE=words|"
-              "NEXT=|MERGED=2|");
+    check(role("2"), {absent, silent},
+          "KIND=role|GROUP=51|ALARM=|SOURCE=|STATE=UNKNOWN|PREVIOUS=before|REASON=wccpd-absent|", &absent);
+    check({EVENT_PROXY_CHANGE,
+           {{"group", "uint8", "7"},
+            {"up", "bool", "false"},
+            {"reason", "string", "no\nanswer\x1b[1m" + std::string(999, 'x')}}},
+          {},
+          "KIND=health|GROUP=7|ALARM=|SOURCE=|STATE=down|PREVIOUS=before|REASON=proxy-down|CAUSE=no?answer?["
+          "1m" +
+              std::string(242, 'x') +
+              "|NEXT=start the proxy; mgmtctl intercept show 7 shows its state|MERGED=2|");
+    check(alarm(EVENT_RAISE_ALARM, "196641", "tunneld"), {loop},
+          "KIND=alarm|GROUP=|ALARM=restart-loop|SOURCE=tunneld|STATE=raised|PREVIOUS=before|"
+          "REASON=restart-loop|",
+          &loop);
+    check(alarm(EVENT_CLEAR_ALARM, "196638", "eth0:grp:51"), {silent},
+          "KIND=alarm|GROUP=51|ALARM=adjacency|SOURCE=eth0:grp:51|STATE=cleared|PREVIOUS=before|REASON=|"
+          "CAUSE=words|NEXT=|MERGED=2|");
     notify_subject subject;
     notify_state state;
     EXPECT_FALSE(read_notify_event({EVENT_ROLE_CHANGE, {{"group", "string", "256"}}}, &subject, &state));
@@ -161,16 +156,13 @@ struct Commands : testing::Test {
     }
     void TearDown() override { (void)!system(("rm -rf " + std::string(directory)).c_str()); }
     std::string add(const char *name, const std::string &script, mode_t mode = 0755) {
-        const std::string path = std::string(directory) + "/" + name;
+        const std::string path = path_of(name);
         std::ofstream(path) << "#!/bin/sh\ncd " << directory << "\n" << script;
         chmod(path.c_str(), mode);
         return path;
     }
-    std::string read(const char *name) {
-        std::ostringstream out;
-        out << std::ifstream(std::string(directory) + "/" + name).rdbuf();
-        return out.str();
-    }
+    std::string path_of(const char *name) const { return std::string(directory) + "/" + name; }
+    std::string read(const char *name) const { return text_of_file(path_of(name)); }
     notify_run run(int64_t limit_ms) {
         return {find_notify_commands(directory).paths,
                 {"WCCP_KIND=role"},
@@ -188,7 +180,7 @@ TEST_F(Commands, RunOneAfterTheOtherWithAllTheirChildren) {
                      "/proc/self/fd | wc -l >>log\n");
     EXPECT_EQ(run_notify_commands(run(10000)), NOTIFY_FAILED);
     EXPECT_EQ(read("log"), "first\nlate\nsecond role yes\nno input\n4\n"); // 4: that of ls itself
-    EXPECT_EQ(said, std::string(directory) + "/10-first: exited with 3\n");
+    EXPECT_EQ(said, path_of("10-first: exited with 3\n"));
 }
 
 TEST_F(Commands, EndWithTheirWholeGroupWhenTheyTakeTooLong) {
@@ -202,11 +194,11 @@ TEST_F(Commands, EndWithTheirWholeGroupWhenTheyTakeTooLong) {
     EXPECT_FALSE(alive("slow"));
     EXPECT_FALSE(alive("stubborn"));
     EXPECT_EQ(read("next"), "next\n");
-    EXPECT_NE(said.find("/20-stubborn: not done after 0 s, ended\n"), std::string::npos) << said;
+    EXPECT_TRUE(contains(said, "/20-stubborn: not done after 0 s, ended\n"));
 
     // When the program ends, so does the running command, and no other is started.
-    unlink((std::string(directory) + "/next").c_str());
-    unlink((std::string(directory) + "/slow").c_str());
+    for (const char *name : {"next", "slow"})
+        unlink(path_of(name).c_str());
     pid_t pid = 0;
     int pidfd = -1, status = 0;
     ASSERT_TRUE(start_notify_commands(run(60000), &pid, &pidfd));
@@ -227,16 +219,13 @@ TEST_F(Commands, OnlyFilesThatOnlyRootCanWriteAreRun) {
     add("group-writable", "true\n", 0775);
     add("plain", "true\n", 0644);
     add("with.dot", "true\n");
-    ASSERT_EQ(symlink("good", (std::string(directory) + "/link").c_str()), 0);
+    ASSERT_EQ(symlink("good", path_of("link").c_str()), 0);
     const notify_commands found = find_notify_commands(directory);
     // The group is root's own.
-    EXPECT_EQ(found.paths, (strings{good, std::string(directory) + "/group-writable"}));
-    ASSERT_EQ(found.refused.size(), 3u);
-    for (const char *refused :
-         {"/link: is not a regular", "/plain: is not executable", "/with.dot: the name"})
-        EXPECT_TRUE((found.refused[0] + found.refused[1] + found.refused[2]).find(refused) !=
-                    std::string::npos)
-            << refused;
+    EXPECT_EQ(found.paths, (strings{good, path_of("group-writable")}));
+    EXPECT_EQ(found.refused.size(), 3u);
+    EXPECT_TRUE(contains(joined(found.refused, ""), "/link: is not a regular", "/plain: is not executable",
+                         "/with.dot: the name"));
     chmod(good.c_str(), 0757);
     EXPECT_EQ(find_notify_commands(directory).paths.size(), 1u);
     if (chown(good.c_str(), 65534, 65534) == 0) {

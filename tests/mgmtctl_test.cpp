@@ -7,9 +7,8 @@
 #include <algorithm>
 #include <cerrno>
 #include <filesystem>
-#include <fstream>
 #include <functional>
-#include <iterator>
+#include <sstream>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -23,6 +22,7 @@
 #include "peers/mgmtctl/watch.h"
 #include "peers/nodes/binding_text.h"
 #include "tests/support/gcl_provider.h"
+#include "tests/support/texts.h"
 
 static const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config";
 static const std::string G51 = GROUPS + "/51";
@@ -56,27 +56,19 @@ TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
 
 TEST(Shown, AnEventIsALineAndAnObject) {
     const ctl_binding group = {"group", "uint8", "51"}, reason = {"reason", "string", "refused\033"};
-    const struct {
-        ctl_event event;
-        const char *text, *json;
-    } cases[] = {
-        {{EVENT_GROUP_LEAVE, {group, reason}},
-         "group 51 leaves its routers: refused?",
-         R"({"event":"group_leave","group":51,"reason":"refused?"})"},
-        {{EVENT_GROUP_JOIN, {group}},
-         "group 51 joins its routers again",
-         R"({"event":"group_join","group":51})"},
-        {{EVENT_PROXY_CHANGE, {group, {"up", "bool", "false"}, reason}},
-         "proxy of group 51: down, refused?",
-         R"({"event":"proxy","group":51,"proxy":"down","reason":"refused?"})"},
-        {{EVENT_PROXY_CHANGE, {group, {"up", "bool", "true"}, reason}},
-         "proxy of group 51: up",
-         R"({"event":"proxy","group":51,"proxy":"up","reason":null})"},
+    const ctl_binding up = {"up", "bool", "true"}, down = {"up", "bool", "false"};
+    const auto check = [](const ctl_event &event, const char *text, const char *json) {
+        EXPECT_EQ(text_event(event, false), strings{text});
+        EXPECT_EQ(json_line(json_event(event, false)), std::string(json) + "\n");
     };
-    for (const auto &one : cases) {
-        EXPECT_EQ(text_event(one.event, false), std::vector<std::string>{one.text});
-        EXPECT_EQ(json_line(json_event(one.event, false)), std::string(one.json) + "\n");
-    }
+    check({EVENT_GROUP_LEAVE, {group, reason}}, "group 51 leaves its routers: refused?",
+          R"({"event":"group_leave","group":51,"reason":"refused?"})");
+    check({EVENT_GROUP_JOIN, {group}}, "group 51 joins its routers again",
+          R"({"event":"group_join","group":51})");
+    check({EVENT_PROXY_CHANGE, {group, down, reason}}, "proxy of group 51: down, refused?",
+          R"({"event":"proxy","group":51,"proxy":"down","reason":"refused?"})");
+    check({EVENT_PROXY_CHANGE, {group, up, reason}}, "proxy of group 51: up",
+          R"({"event":"proxy","group":51,"proxy":"up","reason":null})");
 }
 
 TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
@@ -90,9 +82,8 @@ TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
                                {entry + "11/change_type", "string", "delete"},
                                {entry + "11/name", "string", G51 + "/policy_grp"},
                                {entry + "11/prev_attribs/value", "uint32", "3"}}};
-    EXPECT_EQ(text_event(change, false),
-              (std::vector<std::string>{"modify " + G51 + "/password = ******** (was ********)",
-                                        "delete " + G51 + "/policy_grp (was 3)"}));
+    EXPECT_EQ(text_event(change, false), (strings{"modify " + G51 + "/password = ******** (was ********)",
+                                                  "delete " + G51 + "/policy_grp (was 3)"}));
     const ctl_json told = json_event(change, true);
     EXPECT_EQ(told["changes"][0]["after"], "neu");
     EXPECT_EQ(json_line(told["changes"][1]), "{\"name\":\"" + G51 +
@@ -109,101 +100,62 @@ TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
                                    {G51 + "/policy_grp", "uint32", "3"},
                                    {G51 + "/weight", "uint32", "100"},
                                    {G51 + "/router/1", "uint8", "1"}}};
-    const auto set = [](const std::string &name, const std::string &value) {
-        return ctl_change_item{ctl_change::create, {name, "", value}};
+    const auto check = [&](const char *changes, const strings &created, const char *note) { // a piece of it
+        std::vector<ctl_change_item> items; // NAME=VALUE, or NAME to remove it
+        std::istringstream words(changes);
+        for (std::string word; words >> word;) {
+            const size_t end = std::min(word.find('='), word.size());
+            items.push_back(
+                {end < word.size() ? ctl_change::create : ctl_change::remove,
+                 {GROUPS + "/" + word.substr(0, end), "", word.substr(std::min(end + 1, word.size()))}});
+        }
+        const change_notes said = notes_of(items, before);
+        EXPECT_EQ(said.created, created) << changes;
+        EXPECT_EQ(said.notes.size(), *note ? 1u : 0u) << changes;
+        EXPECT_TRUE(contains(joined(said.notes, ""), note));
     };
-    const auto remove = [](const std::string &name) {
-        return ctl_change_item{ctl_change::remove, {name, "", ""}};
-    };
-    const struct {
-        std::vector<ctl_change_item> items;
-        std::vector<std::string> created;
-        std::vector<const char *> notes; // a piece of each
-    } cases[] = {
-        {{set(G51 + "/weight", "7")}, {}, {}},
-        {{set(G51 + "/priority", "10"), set(G51 + "/priority", "0x0a"), remove(G51 + "/protocol")}, {}, {}},
-        {{set(G51 + "/priority", "9"), set(G51 + "/router/2/ipaddr", "10.0.0.2")},
-         {},
-         {"group 51: wccpd applies a change of priority, router only by"}},
-        {{remove(G51 + "/priority")}, {}, {"a change of priority only by"}},
-        {{remove(G51 + "/interface")}, {}, {"a change of interface"}}, // it wasn't set, as far as is known
-        {{remove(G51 + "/policy_grp"), remove(G51 + "/router/1")},
-         {},
-         {"a change of policy_grp, router/1 only by"}},
-        {{remove(G51 + "/router/1"), remove(G51)}, {}, {}},
-        {{set(GROUPS + "/53/weight", "7"), set(GROUPS + "/53/priority", "1")}, {GROUPS + "/53"}, {}},
-        {{set(GROUPS + "/53/weight", "7"), remove(GROUPS + "/52")}, {GROUPS + "/53"}, {}},
-        {{set(GROUPS + "/53/weight", "7"), set(G51 + "/weight", "7")}, {GROUPS + "/53"}, {}},
-    };
-    for (const auto &one : cases) {
-        const change_notes said = notes_of(one.items, before);
-        EXPECT_EQ(said.created, one.created);
-        ASSERT_EQ(said.notes.size(), one.notes.size()) << one.items[0].binding.name;
-        for (size_t i = 0; i < said.notes.size(); i++)
-            EXPECT_NE(said.notes[i].find(one.notes[i]), std::string::npos) << said.notes[i];
-    }
+    check("51/weight=7", {}, "");
+    check("51/priority=10 51/priority=0x0a 51/protocol", {}, "");
+    check("51/priority=9 51/router/2/ipaddr=10.0.0.2", {},
+          "group 51: wccpd applies a change of priority, router only by");
+    check("51/priority", {}, "a change of priority only by");
+    check("51/interface", {}, "a change of interface"); // it wasn't set, as far as is known
+    check("51/policy_grp 51/router/1", {}, "a change of policy_grp, router/1 only by");
+    check("51/router/1 51", {}, "");
+    check("53/weight=7 53/priority=1", {GROUPS + "/53"}, "");
+    check("53/weight=7 52", {GROUPS + "/53"}, "");
+    check("53/weight=7 51/weight=7", {GROUPS + "/53"}, "");
 }
 
 // Two configurations: what is shown of their difference, and what is asked for. Applied, nothing differs.
 TEST(Changes, AWholeConfigurationIsItsDifference) {
     const std::string section = "[" + G51 + "]\n", routers = "router/1/ipaddr = 10.0.0.1\n";
-    const struct {
-        std::string before, after;
-        std::vector<std::string> shown, items; // items: +NAME=VALUE, or -NAME; without the group's root
-        size_t notes;
-    } cases[] = {
-        {section + "weight = 100\n", section, {}, {}, 0},
-        {section, section + "weight = 100\n", {}, {}, 0},
-        {section + "weight = 7\n", section, {"modify /weight = 100 (was 7)"}, {"-/weight"}, 0},
-        {section + "weight = 7\n",
-         section + "weight=100\n",
-         {"modify /weight = 100 (was 7)"},
-         {"+/weight=100"},
-         0},
-        {"", section + "weight = 7\n", {"add     = 51", "add    /weight = 7"}, {"+=51", "+/weight=7"}, 0},
-        {section + "weight = 7\n", "", {"delete  (was 51)", "delete /weight (was 7)"}, {"-"}, 0},
-        {section + routers + "router/2/ipaddr = 10.0.0.2\npassword = a\n",
-         section + routers + "password = b\n",
-         {"modify /password = ******** (was ********)", "delete /router/2 (was 2)",
-          "delete /router/2/ipaddr (was 10.0.0.2)"},
-         {"+/password=b", "-/router/2"},
-         1},
-        // A password that is hidden stays; an object of nodes is the same as a file.
-        {section + "password = a\nweight = 7\n", section + "password = ********\nweight = 7\n", {}, {}, 0},
-        {section + "password = a\nweight = 7\nencap = l2\n",
-         "{\"" + G51 + "/password\": \"********\", \"" + G51 + "/weight\": 8, \"" + G51 +
-             "/hash_dst_ip\": true}",
-         {"modify /encap = either (was l2)", "modify /hash_dst_ip = true (was false)",
-          "modify /weight = 8 (was 7)"},
-         {"-/encap", "+/hash_dst_ip=true", "+/weight=8"},
-         1},
-    };
-    for (const auto &one : cases) {
+    std::string errors;
+    // The names are without the group's root; items are +NAME=VALUE, or -NAME.
+    const auto check = [&](const std::string &from, const std::string &to, const char *wanted_changes,
+                           const char *wanted_items, size_t notes) {
         config_text before;
-        node_tree after;
-        std::string errors;
-        ASSERT_TRUE(config_parse(one.before, "F", &before)) << before.errors;
-        ASSERT_TRUE(read_config(one.after, "F", before.tree, false, &after, &errors)) << errors;
+        node_tree after, made;
+        ASSERT_TRUE(config_parse(from, "F", &before)) << before.errors;
+        ASSERT_TRUE(read_config(to, "F", before.tree, false, &after, &errors)) << errors;
         const std::vector<node_change> changes = config_changes(before.tree, after);
         const std::vector<ctl_change_item> asked = items_of(changes, after);
-        std::vector<std::string> shown, items;
+        strings shown, items;
+        std::vector<set_step> steps;
         for (const node_change &change : changes)
             shown.push_back(text_change(change, false).erase(7, G51.size()));
-        for (const ctl_change_item &item : asked)
-            items.push_back(item.change == ctl_change::create
-                                ? "+" + item.binding.name.substr(G51.size()) + "=" + item.binding.value
-                                : "-" + item.binding.name.substr(G51.size()));
-        EXPECT_EQ(shown, one.shown) << one.after;
-        EXPECT_EQ(items, one.items) << one.after;
-        EXPECT_EQ(config_notes(asked, before.tree).notes.size(), one.notes) << one.after;
-
-        std::vector<set_step> steps;
-        node_tree made;
-        for (const ctl_change_item &item : asked)
-            steps.push_back({item.change == ctl_change::create ? set_kind::create : set_kind::remove,
-                             item.binding.name, bn_type_str, item.binding.value});
+        for (const auto &[kind, binding] : asked) {
+            const bool creates = kind == ctl_change::create;
+            items.push_back((creates ? "+" : "-") + binding.name.substr(G51.size()) +
+                            (creates ? "=" + binding.value : ""));
+            steps.push_back(
+                {creates ? set_kind::create : set_kind::remove, binding.name, bn_type_str, binding.value});
+        }
+        EXPECT_EQ(joined(shown, ", "), wanted_changes) << to;
+        EXPECT_EQ(joined(items, " "), wanted_items) << to;
+        EXPECT_EQ(config_notes(asked, before.tree).notes.size(), notes) << to;
         EXPECT_EQ(tree_prepare(before.tree, steps, &made).message, "");
-        EXPECT_EQ(made.nodes, after.nodes) << one.after;
+        EXPECT_EQ(made.nodes, after.nodes) << to;
         // What is exported reads the same, with the passwords and without.
         for (const bool secrets : {false, true})
             for (const std::string &text :
@@ -211,48 +163,63 @@ TEST(Changes, AWholeConfigurationIsItsDifference) {
                 node_tree again;
                 ASSERT_TRUE(read_config(text, "F", made, false, &again, &errors)) << text << errors;
                 EXPECT_EQ(again.set, made.set) << text;
-                EXPECT_EQ(text.find("= b") != std::string::npos || text.find("\"b\"") != std::string::npos,
-                          secrets && one.after.find("password = b") != std::string::npos)
+                EXPECT_EQ(contains(text, "= b") || contains(text, "\"b\""),
+                          secrets && contains(to, "password = b"))
                     << text;
             }
-    }
+    };
+    check(section + "weight = 100\n", section, "", "", 0);
+    check(section, section + "weight = 100\n", "", "", 0);
+    check(section + "weight = 7\n", section, "modify /weight = 100 (was 7)", "-/weight", 0);
+    check(section + "weight = 7\n", section + "weight=100\n", "modify /weight = 100 (was 7)", "+/weight=100",
+          0);
+    check("", section + "weight = 7\n", "add     = 51, add    /weight = 7", "+=51 +/weight=7", 0);
+    check(section + "weight = 7\n", "", "delete  (was 51), delete /weight (was 7)", "-", 0);
+    check(section + routers + "router/2/ipaddr = 10.0.0.2\npassword = a\n",
+          section + routers + "password = b\n",
+          "modify /password = ******** (was ********), delete /router/2 (was 2), "
+          "delete /router/2/ipaddr (was 10.0.0.2)",
+          "+/password=b -/router/2", 1);
+    // A password that is hidden stays; an object of nodes is the same as a file.
+    check(section + "password = a\nweight = 7\n", section + "password = ********\nweight = 7\n", "", "", 0);
+    check(section + "password = a\nweight = 7\nencap = l2\n",
+          "{\"" + G51 + "/password\": \"********\", \"" + G51 + "/weight\": 8, \"" + G51 +
+              "/hash_dst_ip\": true}",
+          "modify /encap = either (was l2), modify /hash_dst_ip = true (was false), "
+          "modify /weight = 8 (was 7)",
+          "-/encap +/hash_dst_ip=true +/weight=8", 1);
 
     config_text before;
     node_tree after;
-    std::string errors;
     ASSERT_TRUE(config_parse(section + routers + "weight = 7\n", "F", &before));
     ASSERT_TRUE(
         read_config(section + "router/2/ipaddr = 10.0.0.2\n", "F", before.tree, true, &after, &errors));
     EXPECT_EQ(items_of(config_changes(before.tree, after), after).size(), 2u) << "the rest stays";
-    const struct {
-        std::string content, error;
-    } refused[] = {
-        {section + "password = ********\n",
-         "F:2: " + G51 + "/password: the password is hidden, and there is none here"},
-        {section + "router/2/ipaddr = 10.0.0.2\n", "F:2: " + G51 + "/router: entries are numbered from 1"},
-        {section + "weight = x\n", "F:2: " + G51 + "/weight: \"x\" is not a valid uint32\n"},
-        {"{", "F: is not a JSON object of nodes and their values\n"},
-        {" {\"/a\": 1}", "F: /a: there is no such node in the configuration\n"},
-        {"{\"" + G51 + "/weight\": {\"a\": [[1]]}}",
-         "F: " + G51 + "/weight: the value is neither a text nor"},
-        {"{\"" + G51 + "/weight\": 1.5}", "F: " + G51 + "/weight: \"1.5\" is not a valid uint32\n"},
-        {"{\"" + G51 + "\": 51, \"" + G51 + "\": 51}", "F: " + G51 + ": is given twice\n"},
-        {"{\"" + G51 + "/router/2/ipaddr\": \"10.0.0.2\"}",
-         "F: " + G51 + "/router: entries are numbered from 1"},
-        {std::string(1 << 20, '{'), "F: is not a JSON object"},
-        {"{\"" + G51 + "\":" + std::string(1 << 20, '['), "F: is not a JSON object"},
+    const auto refuse = [&](const std::string &content, const std::string &error) { // "G" is the group
+        EXPECT_FALSE(read_config(content, "F", before.tree, false, &after, &errors));
+        const size_t at = error.find('G');
+        EXPECT_TRUE(
+            errors.starts_with("F:" + (at < 4 ? error.substr(0, at) + G51 + error.substr(at + 1) : error)))
+            << errors;
     };
-    for (const auto &one : refused) {
-        EXPECT_FALSE(read_config(one.content, "F", before.tree, false, &after, &errors));
-        EXPECT_TRUE(errors.starts_with(one.error)) << errors;
-    }
+    refuse(section + "password = ********\n",
+           "2: G/password: the password is hidden, and there is none here");
+    refuse(section + "router/2/ipaddr = 10.0.0.2\n", "2: G/router: entries are numbered from 1");
+    refuse(section + "weight = x\n", "2: G/weight: \"x\" is not a valid uint32\n");
+    refuse("{", " is not a JSON object of nodes and their values\n");
+    refuse(" {\"/a\": 1}", " /a: there is no such node in the configuration\n");
+    refuse("{\"" + G51 + "/weight\": {\"a\": [[1]]}}", " G/weight: the value is neither a text nor");
+    refuse("{\"" + G51 + "/weight\": 1.5}", " G/weight: \"1.5\" is not a valid uint32\n");
+    refuse("{\"" + G51 + "\": 51, \"" + G51 + "\": 51}", " G: is given twice\n");
+    refuse("{\"" + G51 + "/router/2/ipaddr\": \"10.0.0.2\"}", " G/router: entries are numbered from 1");
+    refuse(std::string(1 << 20, '{'), " is not a JSON object");
+    refuse("{\"" + G51 + "\":" + std::string(1 << 20, '['), " is not a JSON object");
 }
 
 // --- Names
 
-namespace {
 // mgmtd and wccpd as far as queries go.
-struct tree {
+struct queried_tree {
     std::vector<ctl_binding> nodes;
     int asked = 0;
     size_t most = SIZE_MAX; // of nodes in an answer
@@ -275,9 +242,8 @@ struct tree {
         return true;
     }
 };
-} // namespace
 
-static tree sample() {
+static queried_tree sample() {
     return {{{G51, "uint8", "51"},
              {G51 + "/weight", "uint32", "100"},
              {GROUPS + "/7", "uint8", "7"},
@@ -291,50 +257,39 @@ static tree sample() {
 }
 
 TEST(Names, AreCompletedToTheirNextPart) {
-    tree known = sample();
-    const ctl_ask ask = std::ref(known);
-    const struct {
-        std::string word, found; // separated by blanks
-    } cases[] = {
-        {"/qv/wccpd/system/state/debug_",
-         "/qv/wccpd/system/state/debug_all /qv/wccpd/system/state/debug_global"},
-        {GROUPS + "/", GROUPS + "/7 " + G51},
-        {"/logging/syslog/process/", "/logging/syslog/process/wccpd"},
-        {"/logging/syslog/action/file/\\/va", "/logging/syslog/action/file/\\/var\\/log\\/messages"},
-        {G51 + "/encap=", G51 + "/encap=gre " + G51 + "/encap=l2 " + G51 + "/encap=either"},
-        {"qv", ""},
+    queried_tree known = sample();
+    const auto check = [&](const std::string &word, const std::string &found) {
+        EXPECT_EQ(joined(completions(std::ref(known), word), " "), found);
     };
-    for (const auto &one : cases) {
-        std::string found;
-        for (const std::string &candidate : completions(ask, one.word))
-            found += (found.empty() ? "" : " ") + candidate;
-        EXPECT_EQ(found, one.found) << one.word;
-    }
+    check("/qv/wccpd/system/state/debug_",
+          "/qv/wccpd/system/state/debug_all /qv/wccpd/system/state/debug_global");
+    check(GROUPS + "/", GROUPS + "/7 " + G51);
+    check("/logging/syslog/process/", "/logging/syslog/process/wccpd");
+    check("/logging/syslog/action/file/\\/va", "/logging/syslog/action/file/\\/var\\/log\\/messages");
+    check(G51 + "/encap=", G51 + "/encap=gre " + G51 + "/encap=l2 " + G51 + "/encap=either");
+    check("qv", "");
 }
 
 TEST(Names, AMistypedOneGetsAHint) {
-    tree known = sample();
+    queried_tree known = sample();
     const ctl_ask ask = std::ref(known);
-    const struct {
-        std::string name, hint;
-    } cases[] = {
-        {"qv/wccpd", "a name begins with \"/\""},
-        {"/qv//wccpd", "a name has no empty part"},
-        {"/qv", "it has no value of its own; \"mgmtctl walk /qv\" lists what is below"},
-        {"/qv/wcpd/system", "did you mean /qv/wccpd?"},
-        {G51 + "/wieght", "did you mean " + G51 + "/weight?"},
-        {G51 + "/interface", "it can be set, and has no default"},
-        {GROUPS + "/52/weight", "there is no group 52"},
-        {G51 + "/zzzzzz", "\"mgmtctl walk " + G51 + "\" lists what there is"},
+    const auto check = [&](const std::string &name, const std::string &hint) {
+        EXPECT_EQ(hint_for_missing(ask, name), hint);
     };
-    for (const auto &one : cases)
-        EXPECT_EQ(hint_for_missing(ask, one.name), one.hint);
+    check("qv/wccpd", "a name begins with \"/\"");
+    check("/qv//wccpd", "a name has no empty part");
+    check("/qv", "it has no value of its own; \"mgmtctl walk /qv\" lists what is below");
+    check("/qv/wcpd/system", "did you mean /qv/wccpd?");
+    check(G51 + "/wieght", "did you mean " + G51 + "/weight?");
+    check(G51 + "/interface", "it can be set, and has no default");
+    check(GROUPS + "/52/weight", "there is no group 52");
+    check(G51 + "/zzzzzz", "\"mgmtctl walk " + G51 + "\" lists what there is");
     EXPECT_EQ(hint_for_unchangeable(ask, STATES + "/51/oper"), "it is a state: it can only be read");
     EXPECT_EQ(hint_for_unchangeable(ask, G51 + "/weight"), "");
 }
 
 TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
-    tree known = sample();
+    queried_tree known = sample();
     std::vector<ctl_binding> many = {{STATES + "/51/num_appliances", "uint32", "4000000000"},
                                      {STATES + "/51/oper", "string", "x"}};
     ASSERT_TRUE(add_appliances(std::ref(known), STATES, &many));
@@ -346,20 +301,20 @@ TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
 }
 
 TEST(Walks, WhatIsLargerThanAMessageComesInPieces) {
-    tree known = sample();
+    queried_tree known = sample();
     const auto names = [&](const std::string &root, uint32_t code) {
         node_name parsed;
         ctl_reply reply;
         EXPECT_TRUE(parse_node_name(root, &parsed));
         EXPECT_TRUE(query_walk(std::ref(known), ctl_walk::subtree, parsed, &reply));
         EXPECT_EQ(reply.code, code);
-        std::vector<std::string> out;
+        strings out;
         for (const ctl_binding &binding : reply.bindings)
             out.push_back(binding.name);
         std::sort(out.begin(), out.end());
         return out;
     };
-    const std::vector<std::string> all = names("/qv", LC_OK);
+    const strings all = names("/qv", LC_OK);
     EXPECT_EQ(known.asked, 1);
     for (known.most = 3; known.most < 9; known.most++)
         EXPECT_EQ(names("/qv", LC_OK), all) << known.most;
@@ -369,31 +324,26 @@ TEST(Walks, WhatIsLargerThanAMessageComesInPieces) {
 
 // --- The session
 
-namespace {
-wire serialized(bn_request_msg *taken) {
-    const owned_request msg(taken);
+static wire frame_of(uint16_t mtype, const tbuffer *buffer) {
+    const auto *bytes = reinterpret_cast<const char *>(tb_buf(buffer));
+    return frame_bytes(2, mtype, {bytes, static_cast<size_t>(tb_length(buffer))});
+}
+static wire event_frame(const char *name) {
+    owned_request msg;
     owned_tbuffer frame;
-    taken->service_id = 2;
-    EXPECT_EQ(bn_request_msg_serialize(taken, 0, &frame.pointer), LC_OK);
-    return {reinterpret_cast<const char *>(tb_buf(frame.pointer)),
-            static_cast<size_t>(tb_length(frame.pointer))};
+    EXPECT_EQ(bn_event_request_msg_create(&msg.pointer, name), LC_OK);
+    msg.pointer->service_id = 2;
+    EXPECT_EQ(bn_request_msg_serialize(msg.pointer, 0, &frame.pointer), LC_OK);
+    return frame_of(7, frame.pointer);
 }
-wire event_frame(const char *name) {
-    bn_request_msg *msg = nullptr;
-    EXPECT_EQ(bn_event_request_msg_create(&msg, name), LC_OK);
-    return frame_bytes(2, 7, serialized(msg));
-}
-wire answer_frame(uint32_t response_to, uint32_t code, const char *text) {
+static wire answer_frame(uint32_t response_to, uint32_t code, const char *text) {
     owned_response msg;
     owned_tbuffer frame;
     EXPECT_EQ(bn_query_response_msg_create(&msg.pointer, response_to, code, text), LC_OK);
     msg.pointer->service_id = 2;
     EXPECT_EQ(bn_response_msg_serialize(msg.pointer, 0, &frame.pointer), LC_OK);
-    return frame_bytes(2, 2,
-                       {reinterpret_cast<const char *>(tb_buf(frame.pointer)),
-                        static_cast<size_t>(tb_length(frame.pointer))});
+    return frame_of(2, frame.pointer);
 }
-} // namespace
 
 TEST(Session, ARequestGetsItsOwnAnswerAndEventsWaitForTheirTurn) {
     gcl_provider provider;
@@ -470,47 +420,40 @@ TEST(Check, EachFactIsJudged) {
         void (*change)(check_facts *host);
         const char *found;
     } rows[] = {
-        {[](check_facts *) {}, ""},
-        {[](check_facts *host) {
-             host->sockets.push_back({"0.0.0.0", "nfsd", 9});
-         },
-         "port-taken "},
-        {[](check_facts *host) { host->sockets[1].address = "10.0.0.101"; }, "port-taken "},
-        {[](check_facts *host) { host->sockets[0].program = ""; }, "-UDP port 2048 "},
-        {[](check_facts *host) { host->sockets[0].program = "", host->wccpd_runs = false; },
+        {[](auto *) {}, ""},
+        {[](auto *host) { host->sockets[1].address = "0.0.0.0"; }, "port-taken "},
+        {[](auto *host) { host->sockets[1].address = "10.0.0.101"; }, "port-taken "},
+        {[](auto *host) { host->sockets[0].program = ""; }, "-UDP port 2048 "},
+        {[](auto *host) { host->sockets[0].program = "", host->wccpd_runs = false; },
          "port-taken -locked memory "},
-        {[](check_facts *host) { host->groups[2].up = true; }, "interface-missing@53 "},
-        {[](check_facts *host) { host->groups[0].interface = host->groups[1].interface = ""; },
+        {[](auto *host) { host->groups[2].up = true; }, "interface-missing@53 "},
+        {[](auto *host) { host->groups[0].interface = host->groups[1].interface = ""; },
          "no-interface@51 no-interface@52 "},
-        {[](check_facts *host) { host->interfaces["eth0"].up = false; }, "interface-down@51 "},
-        {[](check_facts *host) { host->interfaces["eth0"].addresses.clear(); }, "interface-no-address@51 "},
-        {[](check_facts *host) { host->all_rp_filter = 1; }, "rp-filter rp-filter@52 "},
-        {[](check_facts *host) { host->interfaces["eth0"].rp_filter = 1; }, "rp-filter@52 "},
-        {[](check_facts *host) { host->all_rp_filter = 2, host->interfaces["wccp0"].rp_filter = 1; }, ""},
-        {[](check_facts *host) { host->interfaces["wccp0"].forwarding = 0; }, "forwarding-off "},
-        {[](check_facts *host) { host->interfaces["eth0"].forwarding = 0; }, "forwarding-later@52 "},
-        {[](check_facts *host) { host->interfaces["eth0"].mtu = 1499; }, "mtu-small@51 "},
-        {[](check_facts *host) { host->gre = check_feature::missing; }, "gre-by-tun "},
-        {[](check_facts *host) { host->gre = host->tun = check_feature::missing; }, "gre-missing "},
-        {[](check_facts *host) { host->tproxy = check_feature::missing, host->tun = check_feature::unknown; },
+        {[](auto *host) { host->interfaces["eth0"].up = false; }, "interface-down@51 "},
+        {[](auto *host) { host->interfaces["eth0"].addresses.clear(); }, "interface-no-address@51 "},
+        {[](auto *host) { host->all_rp_filter = 1; }, "rp-filter rp-filter@52 "},
+        {[](auto *host) { host->interfaces["eth0"].rp_filter = 1; }, "rp-filter@52 "},
+        {[](auto *host) { host->all_rp_filter = 2, host->interfaces["wccp0"].rp_filter = 1; }, ""},
+        {[](auto *host) { host->interfaces["wccp0"].forwarding = 0; }, "forwarding-off "},
+        {[](auto *host) { host->interfaces["eth0"].forwarding = 0; }, "forwarding-later@52 "},
+        {[](auto *host) { host->interfaces["eth0"].mtu = 1499; }, "mtu-small@51 "},
+        {[](auto *host) { host->gre = check_feature::missing; }, "gre-by-tun "},
+        {[](auto *host) { host->gre = host->tun = check_feature::missing; }, "gre-missing "},
+        {[](auto *host) { host->tproxy = check_feature::missing, host->tun = check_feature::unknown; },
          "tproxy-missing -kernel "},
-        {[](check_facts *host) { host->clock_synchronised = false; }, "clock-unsynchronised "},
-        {[](check_facts *host) { host->may_lock = false; }, ""}, // there is no limit
-        {[](check_facts *host) { host->may_lock = false, host->lock_limit_bytes = 65536; }, "memory-lock "},
-        {[](check_facts *host) {
-             host->mem_conf = {ENOENT, 0, false};
-         },
+        {[](auto *host) { host->clock_synchronised = false; }, "clock-unsynchronised "},
+        {[](auto *host) { host->may_lock = false; }, ""}, // there is no limit
+        {[](auto *host) { host->may_lock = false, host->lock_limit_bytes = 65536; }, "memory-lock "},
+        {[](auto *host) { host->mem_conf.error = ENOENT, host->mem_conf.complete = false; },
          "mem-conf-unreadable "},
-        {[](check_facts *host) {
-             host->mem_conf = {0, 3, false};
-         },
+        {[](auto *host) { host->mem_conf.bad_line = 3, host->mem_conf.complete = false; },
          "mem-conf-line mem-conf-mailbox "},
-        {[](check_facts *host) { host->mem_conf.error = EACCES, host->root = false; }, "-mem.conf "},
-        {[](check_facts *host) { host->platform_conf.error = ENOENT; }, ""},
-        {[](check_facts *host) { host->platform_conf.bad_line = 1; }, "platform-conf-line "},
-        {[](check_facts *host) { host->filter_error = "no", host->legacy_tables = "filter"; },
+        {[](auto *host) { host->mem_conf.error = EACCES, host->root = false; }, "-mem.conf "},
+        {[](auto *host) { host->platform_conf.error = ENOENT; }, ""},
+        {[](auto *host) { host->platform_conf.bad_line = 1; }, "platform-conf-line "},
+        {[](auto *host) { host->filter_error = "no", host->legacy_tables = "filter"; },
          "-firewall -firewall "},
-        {[](check_facts *host) { host->mgmtd_error = "gone", host->groups.clear(), host->all_rp_filter = 1; },
+        {[](auto *host) { host->mgmtd_error = "gone", host->groups.clear(), host->all_rp_filter = 1; },
          "rp-filter -interfaces -rp_filter -forwarding -MTU "},
     };
     for (const auto &row : rows) {
@@ -520,14 +463,13 @@ TEST(Check, EachFactIsJudged) {
             host.sockets.clear();
         EXPECT_EQ(judged(host), row.found) << &row - rows;
     }
-    std::ifstream in(WCCP_SOURCE_DIR "/docs/operations.md");
-    const std::string documents{std::istreambuf_iterator<char>(in), {}};
+    const std::string documents = text_of_file(WCCP_SOURCE_DIR "/docs/operations.md");
     for (const reason_text &text : check_texts())
-        EXPECT_NE(documents.find(std::string("| `") + text.code + "` "), std::string::npos) << text.code;
+        EXPECT_TRUE(contains(documents, std::string("| `") + text.code + "` "));
 }
 
 // A table "f" with a chain at a hook, of these rules.
-static std::string listing(const std::string &head, const std::vector<std::string> &rules) {
+static std::string listing(const std::string &head, const strings &rules) {
     const std::string above = R"("family":"inet","table":"f",)";
     std::string text = R"({"nftables":[{"set":{)" + above + R"("name":"ports","elem":[53,2048]}},)" +
                        R"({"chain":{)" + above + R"("name":"refuse"}},{"chain":{)" + above +
@@ -545,57 +487,42 @@ TEST(Check, RulesThatDropTheProtocolAreFound) {
     const char *const port = R"("payload":{"protocol":"udp","field":"dport"})";
     const char *const protocol = R"("meta":{"key":"l4proto"})";
     const char *const from = R"("payload":{"protocol":"ip","field":"saddr"})";
-    const std::string closed = R"("hook":"input","policy":"drop")", accept = R"({"accept":null})",
-                      drop = R"({"counter":{}},{"drop":null})",
-                      replies =
-                          match(R"("ct":{"key":"state"})", R"(["established","related"])", "in") + accept;
-    const struct {
-        std::string head;
-        std::vector<std::string> rules;
-        const char *found;
-    } rows[] = {
-        {R"("hook":"input")", {}, ""},
-        {closed, {replies}, "firewall-drops-wccp@51 firewall-drops-gre@51 "},
-        {R"("hook":"forward","policy":"drop")", {}, ""},
-        {R"("hook":"output","policy":"drop")",
-         {match(R"("meta":{"key":"oifname"})", R"("eth*")") + accept},
-         ""},
-        {closed, {match(port, "2048") + accept}, "firewall-drops-gre@51 "},
-        {closed, {match(port, R"("@ports")") + accept, match(protocol, "47") + accept}, ""},
-        {closed, {match(protocol, R"({"set":["gre","esp"]})") + accept}, "firewall-drops-wccp@51 "},
-        {closed,
-         {match(port, R"({"set":[53,{"range":[2000,2047]}]})") + accept, match(protocol, "47") + accept},
-         "firewall-drops-wccp@51 "},
-        {closed, {match(port, "53", "!=") + accept, match(protocol, "47") + accept}, ""},
-        {closed,
-         {match(R"("meta":{"key":"iifname"})", R"("lo")") + accept, match(from, R"("10.0.0.1")") + accept},
-         "firewall-unclear@51 firewall-unclear@51 "},
-        {R"("hook":"input")",
-         {match(protocol, "47") + R"({"jump":{"target":"refuse"}})"},
-         "firewall-drops-gre@51 "},
-        {R"("hook":"input")",
-         {R"({"limit":{"rate":10}},)" + match(port, "2048") + drop},
-         "firewall-unclear@51 "},
-        {R"("hook":"prerouting")",
-         {R"({"vmap":{"key":{"meta":{"key":"l4proto"}},"data":{"set":[["udp",{"drop":null}]]}}})"},
-         "firewall-drops-wccp@51 "},
-        // Of iptables-nft.
-        {R"("hook":"input")",
-         {match(protocol, "17") + R"({"xt":{"type":"target","name":"LOG"}})",
-          match(protocol, "17") + R"({"xt":{"type":"target","name":"REJECT"}})",
-          match(protocol, "6") + R"({"xt":null})"},
-         "firewall-drops-wccp@51 "},
-        {R"("hook":"input")", {match(protocol, "47") + R"({"xt":null})"}, "firewall-unclear@51 "},
-        // After what may be dropped, what is dropped; after what may pass, nothing is certain.
-        {closed,
-         {match(from, R"("10.0.0.9")") + drop, match(protocol, "47") + accept},
-         "firewall-drops-wccp@51 firewall-unclear@51 "},
-    };
-    for (const auto &row : rows) {
+    const std::string input = R"("hook":"input")", closed = R"("hook":"input","policy":"drop")",
+                      accept = R"({"accept":null})", drop = R"({"counter":{}},{"drop":null})",
+                      gre = match(protocol, "47"), udp = match(protocol, "17"), accept_gre = gre + accept,
+                      replies = match(R"("ct":{"key":"state"})", R"(["established","related"])", "in");
+    const std::string no_wccp = "firewall-drops-wccp@51 ", no_gre = "firewall-drops-gre@51 ",
+                      unclear = "firewall-unclear@51 ";
+    const auto check = [](const std::string &head, const strings &rules, const std::string &found) {
         check_facts host = sound_host();
-        host.filter_listing = listing(row.head, row.rules);
-        EXPECT_EQ(judged(host), row.found) << host.filter_listing;
-    }
+        host.filter_listing = listing(head, rules);
+        EXPECT_EQ(judged(host), found) << host.filter_listing;
+    };
+    check(input, {}, "");
+    check(closed, {replies + accept}, no_wccp + no_gre);
+    check(R"("hook":"forward","policy":"drop")", {}, "");
+    check(R"("hook":"output","policy":"drop")", {match(R"("meta":{"key":"oifname"})", R"("eth*")") + accept},
+          "");
+    check(closed, {match(port, "2048") + accept}, no_gre);
+    check(closed, {match(port, R"("@ports")") + accept, accept_gre}, "");
+    check(closed, {match(protocol, R"({"set":["gre","esp"]})") + accept}, no_wccp);
+    check(closed, {match(port, R"({"set":[53,{"range":[2000,2047]}]})") + accept, accept_gre}, no_wccp);
+    check(closed, {match(port, "53", "!=") + accept, accept_gre}, "");
+    check(closed,
+          {match(R"("meta":{"key":"iifname"})", R"("lo")") + accept, match(from, R"("10.0.0.1")") + accept},
+          unclear + unclear);
+    check(input, {gre + R"({"jump":{"target":"refuse"}})"}, no_gre);
+    check(input, {R"({"limit":{"rate":10}},)" + match(port, "2048") + drop}, unclear);
+    check(R"("hook":"prerouting")",
+          {R"({"vmap":{"key":{"meta":{"key":"l4proto"}},"data":{"set":[["udp",{"drop":null}]]}}})"}, no_wccp);
+    // Of iptables-nft.
+    check(input,
+          {udp + R"({"xt":{"type":"target","name":"LOG"}})",
+           udp + R"({"xt":{"type":"target","name":"REJECT"}})", match(protocol, "6") + R"({"xt":null})"},
+          no_wccp);
+    check(input, {gre + R"({"xt":null})"}, unclear);
+    // After what may be dropped, what is dropped; after what may pass, nothing is certain.
+    check(closed, {match(from, R"("10.0.0.9")") + drop, accept_gre}, no_wccp + unclear);
 }
 
 TEST(Check, ThisHostIsLookedAt) {
@@ -609,10 +536,9 @@ TEST(Check, ThisHostIsLookedAt) {
     ASSERT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&local), sizeof local), 0);
     ctl_link link;
     link.query = [](ctl_walk, const std::string &name, ctl_reply *out, std::string *) {
-        if (name == GROUPS)
-            out->bindings = {{G51, "uint8", "51"}};
-        else
-            out->bindings = {{G51, "uint8", "51"}, {G51 + "/interface", "string", "lo"}};
+        out->bindings = {{G51, "uint8", "51"}};
+        if (name != GROUPS)
+            out->bindings.push_back({G51 + "/interface", "string", "lo"});
         return true;
     };
     const check_facts host = gather_facts(link);

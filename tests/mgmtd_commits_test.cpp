@@ -10,72 +10,57 @@
 
 namespace {
 
-const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config/", POLICY = "/qv/wccpd/wccp/policy_grp/config";
+const std::string POLICY = "/qv/wccpd/wccp/policy_grp/config/5";
 
 TEST_F(Mgmtd, AGroupIsCreatedWithDefaultsAndDeletedWhole) {
-    EXPECT_EQ(set({{bn_set_create, GROUP + "/interface", "eth0"},
-                   {bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"},
-                   {bn_set_create, GROUP + "/weight", "7", bn_type_uint32}}),
-              0u)
-        << message();
-    const strings added = changes();
-    EXPECT_EQ(added.front(), GROUP + "=->51");
-    for (const char *change : {"/interface=->eth0", "/router/1=->1", "/router/1/ipaddr=->10.0.0.1",
-                               "/weight=->7", "/admin=->up", "/password=->", "/mask_dst_ip=->3840"})
-        EXPECT_TRUE(has(added, GROUP + change)) << change;
+    EXPECT_EQ(set("+interface=eth0 +router/1/ipaddr=10.0.0.1 +weight=7"), 0u) << message();
+    const std::string added = changes();
+    EXPECT_TRUE(added.starts_with("51=->51 "));
+    EXPECT_TRUE(contains(added, " 51/interface=->eth0", " 51/router/1=->1 ", " 51/router/1/ipaddr=->10.0.0.1",
+                         " 51/weight=->7", " 51/admin=->up", " 51/password=->", " 51/mask_dst_ip=->3840"));
+    const size_t count = events()[0].size();
     EXPECT_EQ(last_response()->db_revision_id, 2u);
-    EXPECT_EQ(set({{bn_set_delete, GROUP + "/weight", "", bn_type_none}}), 0u);
-    EXPECT_EQ(changes(), strings{GROUP + "/weight=7>100"});
-    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "100"}}), 0u);
-    EXPECT_EQ(changes(), strings{}) << "the same value is not a change";
-    EXPECT_EQ(set({{bn_set_delete, GROUP, "", bn_type_none}}), 0u) << message();
-    EXPECT_EQ(changes().size(), added.size());
-    EXPECT_TRUE(has(changes(), GROUP + "=51>-") && has(changes(), GROUP + "/admin=up>-"));
+    EXPECT_EQ(set("-weight"), 0u);
+    EXPECT_EQ(changes(), "51/weight=7>100");
+    EXPECT_EQ(set("weight=100"), 0u);
+    EXPECT_EQ(changes(), "") << "the same value is not a change";
+    EXPECT_EQ(set("-51"), 0u) << message();
+    EXPECT_EQ(events()[0].size(), count);
+    EXPECT_TRUE(contains(changes(), "51=51>-", "51/admin=up>-"));
 }
 
 TEST_F(Mgmtd, ARefusedStepLeavesEverythingAsItWas) {
-    ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"},
-                   {bn_set_create, GROUP + "/policy_grp", "5"},
-                   {bn_set_create, POLICY + "/5", ""}}),
-              0u);
+    ASSERT_EQ(set("+router/1/ipaddr=10.0.0.1 +policy_grp=5 +" + POLICY), 0u);
     const auto before = daemon.tree.set;
-    const std::string router = GROUP + "/router/2/ipaddr", log = "/logging/syslog/process/";
+    const auto refuse = [&](lc_status status, const set_node &bad) {
+        EXPECT_EQ(set({{bn_set_modify, GROUP + "/admin", "down"}, bad}), static_cast<uint32_t>(status))
+            << bad.name;
+        EXPECT_TRUE(message().starts_with(bad.name.substr(0, 6))) << bad.name << ": " << message();
+        EXPECT_EQ(message().find('\n'), std::string::npos) << message();
+        EXPECT_EQ(changes(), "");
+        EXPECT_EQ(daemon.tree.set, before) << bad.name;
+    };
     std::string deep = GROUP;
     for (int i = 0; i < 64; i++)
         deep += "/a";
-    const struct {
-        lc_status code;
-        set_node bad;
-    } cases[] = {
-        {LC_BAD_PATH, {bn_set_modify, deep, "1"}},
-        {LC_BAD_ARGUMENT, {bn_set_modify, GROUP + "/weight", "70000"}},
-        {LC_BAD_TYPE, {bn_set_modify, GROUP + "/weight", "1", bn_type_uint16}},
-        {LC_NOT_FOUND, {bn_set_modify, GROUP + "/wait", "1"}},
-        {LC_NOT_FOUND, {bn_set_modify, GROUPS + "52/weight", "1"}},
-        {LC_BAD_PATH, {bn_set_modify, "weight", "1"}},
-        {LC_ASSERTION, {bn_set_create, GROUP + "/router/3/ipaddr", "10.0.0.3"}},
-        {LC_ASSERTION, {bn_set_create, GROUP + "/router/2", ""}}, // no address
-        {LC_ASSERTION, {bn_set_delete, GROUP + "/router/1/ipaddr", "", bn_type_none}},
-        {LC_NOT_IMPLEMENTED, {bn_set_reparent, GROUP, "", bn_type_none}},
-        // The file would not give these back unchanged.
-        {LC_BAD_ARGUMENT, {bn_set_create, log + "a\nb/log_level", "debug"}},
-        {LC_BAD_ARGUMENT, {bn_set_create, log + "a\\\\/log_level", "debug"}},
-        {LC_BAD_ARGUMENT, {bn_set_create, log + std::string(256, 'a') + "/log_level", "debug"}},
-        // Addresses that cannot be routers, and a policy group in use.
-        {LC_ASSERTION, {bn_set_create, router, "127.0.0.2"}},
-        {LC_ASSERTION, {bn_set_create, router, "10.0.0.101"}},
-        {LC_ASSERTION, {bn_set_create, router, "10.0.0.255"}},
-        {LC_ASSERTION, {bn_set_create, router, "224.0.1.9"}},
-        {LC_ASSERTION, {bn_set_delete, POLICY + "/5", "", bn_type_none}},
-    };
-    for (const auto &one : cases) {
-        EXPECT_EQ(set({{bn_set_modify, GROUP + "/admin", "down"}, one.bad}), static_cast<uint32_t>(one.code))
-            << one.bad.name;
-        EXPECT_TRUE(message().starts_with(one.bad.name.substr(0, 6))) << one.bad.name << ": " << message();
-        EXPECT_EQ(message().find('\n'), std::string::npos) << message();
-        EXPECT_EQ(changes(), strings{});
-        EXPECT_EQ(daemon.tree.set, before) << one.bad.name;
-    }
+    refuse(LC_BAD_PATH, {bn_set_modify, deep, "1"});
+    refuse(LC_BAD_ARGUMENT, {bn_set_modify, GROUP + "/weight", "70000"});
+    refuse(LC_BAD_TYPE, {bn_set_modify, GROUP + "/weight", "1", bn_type_uint16});
+    refuse(LC_NOT_FOUND, {bn_set_modify, GROUP + "/wait", "1"});
+    refuse(LC_NOT_FOUND, {bn_set_modify, GROUPS + "52/weight", "1"});
+    refuse(LC_BAD_PATH, {bn_set_modify, "weight", "1"});
+    refuse(LC_ASSERTION, {bn_set_create, GROUP + "/router/3/ipaddr", "10.0.0.3"});
+    refuse(LC_ASSERTION, {bn_set_create, GROUP + "/router/2", ""}); // no address
+    refuse(LC_ASSERTION, {bn_set_delete, GROUP + "/router/1/ipaddr", "", bn_type_none});
+    refuse(LC_ASSERTION, {bn_set_delete, POLICY, "", bn_type_none}); // it is in use
+    refuse(LC_NOT_IMPLEMENTED, {bn_set_reparent, GROUP, "", bn_type_none});
+    // The file would not give these back unchanged.
+    for (const std::string &process : {std::string("a\nb"), std::string("a\\\\"), std::string(256, 'a')})
+        refuse(LC_BAD_ARGUMENT,
+               {bn_set_create, "/logging/syslog/process/" + process + "/log_level", "debug"});
+    // Addresses that cannot be routers.
+    for (const char *address : {"127.0.0.2", "10.0.0.101", "10.0.0.255", "224.0.1.9"})
+        refuse(LC_ASSERTION, {bn_set_create, GROUP + "/router/2/ipaddr", address});
 }
 
 TEST_F(Mgmtd, ARunningGroupThatCannotFollowIsDeletedAndCreated) {
@@ -83,39 +68,29 @@ TEST_F(Mgmtd, ARunningGroupThatCannotFollowIsDeletedAndCreated) {
     reload("[" + GROUP + "]\npolicy_grp = 5\nrouter/1/ipaddr = 10.0.0.1\n[" + GROUPS + "7]\n[" + GROUPS +
            "9]\n");
     const uint32_t revision = daemon.tree.revision;
-    const struct {
-        size_t events;
-        std::vector<set_node> nodes;
-    } cases[] = {
-        {2, {{bn_set_modify, GROUP + "/priority", "9"}, {bn_set_modify, GROUP + "/weight", "9"}}},
-        {2, {{bn_set_modify, GROUP + "/interface", "eth1"}}},
-        {2, {{bn_set_modify, GROUP + "/router/1/ipaddr", "10.0.0.2"}}},
-        {3,
-         {{bn_set_create, GROUP + "/router/2/ipaddr", "10.0.0.3"},
-          {bn_set_modify, GROUPS + "7/weight", "9"}}},
-        {2, {{bn_set_delete, GROUP + "/policy_grp", "", bn_type_none}}},
-        // Recreated on purpose, with the same values.
-        {2, {{bn_set_delete, GROUPS + "7", "", bn_type_none}, {bn_set_create, GROUPS + "7/weight", "9"}}},
-        {2, {{bn_set_create, GROUPS + "8", ""}, {bn_set_modify, GROUP + "/weight", "7"}}},
-        {1, {{bn_set_modify, GROUP + "/encap", "l2"}, {bn_set_modify, GROUP + "/assign_detail", "x"}}},
-        {1, {{bn_set_delete, GROUP + "/assign_detail", "", bn_type_none}}},
-    };
-    for (const auto &one : cases) {
-        EXPECT_EQ(set(one.nodes), 0u) << message();
-        EXPECT_EQ(events().size(), one.events) << one.nodes[0].name;
+    const auto check = [&](size_t count, const char *steps) { // of the events that wccpd gets
+        EXPECT_EQ(set(steps), 0u) << message();
+        EXPECT_EQ(events().size(), count) << steps;
         EXPECT_LE(events(3).size(), 1u) << "one commit to everybody else";
-    }
-    EXPECT_EQ(daemon.tree.revision, revision + std::size(cases));
+    };
+    check(2, "priority=9 weight=9");
+    check(2, "interface=eth1");
+    check(2, "router/1/ipaddr=10.0.0.2");
+    check(3, "+router/2/ipaddr=10.0.0.3 7/weight=9");
+    check(2, "-policy_grp");
+    check(2, "-7 +7/weight=9"); // recreated on purpose, with the same values
+    check(2, "+8 weight=7");
+    check(1, "encap=l2 assign_detail=x");
+    check(1, "-assign_detail");
+    EXPECT_EQ(daemon.tree.revision, revision + 9);
 
     // One file with all kinds: deleted, changed and created groups.
     reload("[" + GROUP + "]\npriority = 1\n[" + GROUPS + "7]\nweight = 1\n[" + GROUPS + "11]\n");
     const auto sent_events = events();
     ASSERT_EQ(sent_events.size(), 3u) << said;
-    EXPECT_TRUE(has(sent_events[0], GROUPS + "9=9>-") && has(sent_events[0], GROUP + "=51>-") &&
-                has(sent_events[0], GROUP + "/priority=9>-"));
-    EXPECT_EQ(sent_events[1], strings{GROUPS + "7/weight=9>1"});
-    EXPECT_TRUE(has(sent_events[2], GROUPS + "11=->11") && has(sent_events[2], GROUP + "=->51") &&
-                has(sent_events[2], GROUP + "/priority=->1"));
+    EXPECT_TRUE(contains(joined(sent_events[0], " "), "9=9>-", "51=51>-", "51/priority=9>-"));
+    EXPECT_EQ(sent_events[1], strings{"7/weight=9>1"});
+    EXPECT_TRUE(contains(joined(sent_events[2], " "), "11=->11", "51=->51", "51/priority=->1"));
 
     // Events are bounded, and none has only a part of a group.
     std::string many;
@@ -136,17 +111,14 @@ TEST_F(Mgmtd, ARunningGroupThatCannotFollowIsDeletedAndCreated) {
 
 struct Kept : Mgmtd {
     int64_t clock = 1000000;
-    const set_node four = {bn_set_modify, GROUP + "/weight", "4"};
 
     // Starts again from the same files.
     void start() {
-        std::string errors, warnings;
         daemon.kept = {};
         daemon.tree = {};
         daemon.return_at_ms = -1;
         daemon.clock_s = [this] { return clock; };
-        ASSERT_TRUE(server_load(&daemon, &errors, &warnings)) << errors;
-        server_begin(&daemon);
+        (void)load();
     }
     // Number and cause of the last three.
     std::string history() {
@@ -166,11 +138,10 @@ struct Kept : Mgmtd {
 TEST_F(Kept, OverAStartAndUpToFifty) {
     const std::string pending = commits() + "/pending";
     start();
-    ASSERT_EQ(set({{bn_set_create, GROUP + "/weight", "1"}}), 0u) << message();
+    ASSERT_EQ(set("+weight=1"), 0u) << message();
     EXPECT_EQ(text_of(2), content());
     start();
-    EXPECT_EQ(history(), "1 found at the start; 2 mgmtctl-8; ")
-        << "the configuration is the same: no new commit";
+    EXPECT_EQ(history(), "1 found at the start; 2 mgmtctl-8; ") << "nothing differs: no new commit";
     EXPECT_EQ(daemon.tree.revision, 2u);
     reload(content() + "priority = 1\n");
     std::ofstream(daemon.file.path, std::ios::app) << "encap = l2\n";
@@ -190,36 +161,34 @@ TEST_F(Kept, OverAStartAndUpToFifty) {
         // The weight is given twice, which does not matter to the history.
         history_open(&daemon.kept, content(), daemon.say);
         EXPECT_EQ(history() == before, !replaced);
-        EXPECT_TRUE(access(pending.c_str(), F_OK) != 0 &&
-                    access((pending + ".unfinished").c_str(), F_OK) != 0);
+        EXPECT_TRUE(mode_of(pending) < 0 && mode_of(pending + ".unfinished") < 0);
     }
     EXPECT_EQ(history_find(daemon.kept, 5)->cause, "cut");
 
-    std::ofstream(daemon.file.path) << "[" << GROUP << "]\nweight = 3\n";
+    write("[" + GROUP + "]\nweight = 3\n");
     start();
     for (int i = 0; i < 60; i++)
-        ASSERT_EQ(set({{bn_set_modify, GROUP + "/weight", std::to_string(100 + i)}}), 0u) << message();
+        ASSERT_EQ(set("weight=" + std::to_string(100 + i)), 0u) << message();
     const uint32_t last = daemon.tree.revision;
     query(3, NODE_COMMITS, bn_query_iterate);
     EXPECT_EQ(found().size(), HISTORY_MAX);
     EXPECT_EQ(text_of(last - 50), "");
-    EXPECT_NE(text_of(last - 49).find("weight = 110"), std::string::npos);
+    EXPECT_TRUE(contains(text_of(last - 49), "weight = 110"));
     std::ofstream(commits() + "/commit-" + std::to_string(last - 1)) << "#% commit 1\n";
     start();
     EXPECT_EQ(daemon.kept.entries.size(), HISTORY_MAX - 1) << "an entry that can't be read is reported";
-    EXPECT_NE(said.find("commit " + std::to_string(last - 1) + " can't be read"), std::string::npos) << said;
+    EXPECT_TRUE(contains(said, "commit " + std::to_string(last - 1) + " can't be read"));
 }
 
 TEST_F(Kept, OnConditions) {
-    std::ofstream(daemon.file.path) << "[" << GROUP << "]\nweight = 3\n";
+    write("[" + GROUP + "]\nweight = 3\n");
     start();
     const uint32_t at = daemon.tree.revision;
-    EXPECT_EQ(set({four}, 0, at + 1), static_cast<uint32_t>(LC_ASSERTION));
-    EXPECT_EQ(set({four}, 4), static_cast<uint32_t>(LC_NOT_IMPLEMENTED));
-    EXPECT_EQ(set({four}, bn_cf_check_only), 0u);
+    EXPECT_EQ(set("weight=4", 0, at + 1), static_cast<uint32_t>(LC_ASSERTION));
+    EXPECT_EQ(set("weight=4", 4), static_cast<uint32_t>(LC_NOT_IMPLEMENTED));
+    EXPECT_EQ(set("weight=4", bn_cf_check_only), 0u);
     EXPECT_EQ(message(), "1 node would change");
-    EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "x"}}, bn_cf_check_only),
-              static_cast<uint32_t>(LC_BAD_ARGUMENT));
+    EXPECT_EQ(set("weight=x", bn_cf_check_only), static_cast<uint32_t>(LC_BAD_ARGUMENT));
     EXPECT_EQ(weight() + std::to_string(daemon.tree.revision), "3" + std::to_string(at));
 
     // While a commit waits for confirmation, others are refused; it is undone in time, also by the next
@@ -231,12 +200,12 @@ TEST_F(Kept, OnConditions) {
         return next < 0 ? -1 : next - now;
     };
     for (const std::string how : {"time", "start", "clock", "confirmed", "rollback"}) {
-        ASSERT_EQ(set({four}, 2u << bn_cf_minutes_shift, daemon.tree.revision), 0u) << message();
+        ASSERT_EQ(set("weight=4", 2u << bn_cf_minutes_shift, daemon.tree.revision), 0u) << message();
         EXPECT_EQ(wait(20), 100000);
-        EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "5"}}), static_cast<uint32_t>(LC_ASSERTION));
+        EXPECT_EQ(set("weight=5"), static_cast<uint32_t>(LC_ASSERTION));
         reload("[" + GROUP + "]\nweight = 9\n");
         EXPECT_EQ(weight(), "4") << said;
-        std::ofstream(daemon.file.path) << *daemon.file.seen;
+        write(*daemon.file.seen);
         if (how == "clock")
             clock -= 1000000;
         if (how == "start" || how == "clock") {
@@ -253,7 +222,7 @@ TEST_F(Kept, OnConditions) {
             start();
         } else if (how == "rollback") {
             daemon.kept.directory = directory;
-            EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "3"}}, bn_cf_ends_wait), 0u) << message();
+            EXPECT_EQ(set("weight=3", bn_cf_ends_wait), 0u) << message();
         } else {
             EXPECT_EQ(wait(how == "clock" ? 119 : 99), 1000);
             EXPECT_EQ(weight(), "4");
@@ -263,7 +232,7 @@ TEST_F(Kept, OnConditions) {
         }
         EXPECT_EQ(weight(), how == "confirmed" ? "4" : "3") << how;
         EXPECT_EQ(wait(200), -1) << "no commit waits";
-        EXPECT_EQ(set({{bn_set_modify, GROUP + "/weight", "3"}}), 0u);
+        EXPECT_EQ(set("weight=3"), 0u);
     }
     (void)act(ACTION_CONFIRM);
     EXPECT_EQ(code(), static_cast<uint32_t>(LC_NOT_FOUND));
@@ -272,10 +241,8 @@ TEST_F(Kept, OnConditions) {
 // --- Events and permissions
 
 TEST_F(Mgmtd, AViewerChangesNothingAndSeesNoPassword) {
-    std::ofstream(daemon.file.path) << "# geheim before\n[" << GROUP << "]\npassword = geheim\n";
-    std::string errors, warnings;
-    ASSERT_TRUE(server_load(&daemon, &errors, &warnings)) << errors;
-    server_begin(&daemon);
+    write("# geheim before\n[" + GROUP + "]\npassword = geheim\n");
+    (void)load();
     server_peer_opened(&daemon, 4, "mgmtctl-9", {"user 7", false});
     follow(4, {EVENT_CONFIG_CHANGE});
     asker = 4;
@@ -284,7 +251,7 @@ TEST_F(Mgmtd, AViewerChangesNothingAndSeesNoPassword) {
         return code() == LC_BAD_LOGIN;
     };
     for (const uint32_t flags : {0u, uint32_t{bn_cf_check_only}}) {
-        (void)set({{bn_set_modify, GROUP + "/password", "geheim"}}, flags);
+        (void)set("password=geheim", flags);
         EXPECT_TRUE(refused()) << "nor a check, which would tell whether the password is right";
     }
     action(4, ACTION_CONFIRM, {});
@@ -293,17 +260,14 @@ TEST_F(Mgmtd, AViewerChangesNothingAndSeesNoPassword) {
     EXPECT_TRUE(refused() && daemon.alarm_owners.empty());
 
     asker = 3;
-    ASSERT_EQ(set({{bn_set_modify, GROUP + "/password", "secret"}}), 0u);
-    EXPECT_EQ(events(4), std::vector<strings>{{GROUP + "/password=********>********"}});
-    EXPECT_EQ(events(1), std::vector<strings>{{GROUP + "/password=geheim>secret"}});
+    ASSERT_EQ(set("password=secret"), 0u);
+    EXPECT_EQ(events(4), std::vector<strings>{{"51/password=********>********"}});
+    EXPECT_EQ(changes(), "51/password=geheim>secret");
     for (const std::string &name :
          {GROUP + "/password", std::string(NODE_CONFIG_TEXT), std::string(NODE_COMMITS "/1/text")}) {
-        EXPECT_TRUE(value(name).find("secret") != std::string::npos ||
-                    value(name).find("password = geheim") != std::string::npos)
-            << name;
-        const std::string shown = value(name, 4);
-        EXPECT_NE(shown.find("********"), std::string::npos) << shown;
-        EXPECT_EQ(shown.find("secret") + shown.find("geheim") + 2, 0u) << shown;
+        EXPECT_TRUE(contains(value(name), "secret") || contains(value(name), "password = geheim")) << name;
+        EXPECT_TRUE(contains(value(name, 4), "********"));
+        EXPECT_TRUE(lacks(value(name, 4), "secret", "geheim"));
     }
     for (const char *node : {"/51/debug", "/debug_all"}) {
         clear();
@@ -316,9 +280,8 @@ TEST_F(Mgmtd, AViewerChangesNothingAndSeesNoPassword) {
 }
 
 TEST_F(Mgmtd, AnInterestGetsTheChangesThatItsPatternsMatch) {
-    EXPECT_EQ(
-        set({{bn_set_modify, NODE_SYSTEM_MODE, "bridge"}, {bn_set_modify, NODE_SYSTEM_BONDING, "true"}}), 0u);
-    EXPECT_EQ(changes(), strings{NODE_SYSTEM_MODE "=router>bridge"});
+    EXPECT_EQ(set(NODE_SYSTEM_MODE "=bridge " NODE_SYSTEM_BONDING "=true"), 0u);
+    EXPECT_EQ(changes(), NODE_SYSTEM_MODE "=router>bridge");
     (void)act(ACTION_ADD_INTEREST, {{"match/1/pattern", {bn_type_str, "/a"}}});
     EXPECT_EQ(code(), static_cast<uint32_t>(LC_BAD_ARGUMENT));
     const owned_request large(make_event("/a", {{"a", {bn_type_str, std::string(GCL_FRAME_MAX, 'x')}}}));

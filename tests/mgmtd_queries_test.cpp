@@ -29,28 +29,16 @@ struct Queries : Mgmtd {
 };
 
 TEST_F(Queries, OfTheConfiguration) {
-    const std::string groups = NODE_GROUP_CONFIG;
-    ASSERT_EQ(
-        set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"}, {bn_set_create, groups + "/7", ""}}),
-        0u);
-    const struct {
-        std::string name;
-        uint32_t flags;
-        strings found;
-    } cases[] = {
-        {groups, 0, {groups + "/7=7", GROUP + "=51"}},
-        {GROUP + "/router",
-         bn_qf_subtree | bn_qf_include_self,
-         {GROUP + "/router/1=1", GROUP + "/router/1/ipaddr=10.0.0.1"}},
-        {GROUP + "/router/1",
-         bn_qf_subtree | bn_qf_include_self | bn_qf_leaves_only,
-         {GROUP + "/router/1/ipaddr=10.0.0.1"}},
+    const auto check = [&](const std::string &name, uint32_t flags, const strings &wanted) {
+        query(1, name, bn_query_iterate, flags);
+        EXPECT_EQ(found(), wanted) << name;
+        EXPECT_EQ(code(), 0u) << name;
     };
-    for (const auto &one : cases) {
-        query(1, one.name, bn_query_iterate, one.flags);
-        EXPECT_EQ(found(), one.found) << one.name;
-        EXPECT_EQ(code(), 0u) << one.name;
-    }
+    const std::string router = GROUP + "/router/1", address = router + "/ipaddr=10.0.0.1";
+    ASSERT_EQ(set("+router/1/ipaddr=10.0.0.1 +7"), 0u);
+    check(NODE_GROUP_CONFIG, 0, {GROUPS + "7=7", GROUP + "=51"});
+    check(GROUP + "/router", bn_qf_subtree | bn_qf_include_self, {router + "=1", address});
+    check(router, bn_qf_subtree | bn_qf_include_self | bn_qf_leaves_only, {address});
     EXPECT_EQ(last_response()->response_to, 77u);
 }
 
@@ -75,7 +63,7 @@ TEST_F(Queries, OfStatesAreForwardedToTheDaemonAndTheAnswerBack) {
 
 TEST_F(Queries, ThatWaitAreBoundedAndKeepNoAnswers) {
     for (int id = 0; id < 16; id++)
-        daemon.tree.set[named(NODE_GROUP_CONFIG "/" + std::to_string(id))] = std::to_string(id);
+        daemon.tree.set[named(GROUPS + std::to_string(id))] = std::to_string(id);
     tree_refresh(&daemon.tree);
     const size_t before = mallinfo2().uordblks;
     size_t refused = 0;
@@ -131,7 +119,7 @@ TEST_F(Queries, OfAllGroupsAreSentGroupByGroup) {
 
 // Answers that a client has not read yet reduce the room for further ones.
 TEST_F(Queries, WhoseAnswersDoNotFitAreRefused) {
-    ASSERT_EQ(set({{bn_set_create, GROUP + "/router/1/ipaddr", "10.0.0.1"}}), 0u);
+    ASSERT_EQ(set("+router/1/ipaddr=10.0.0.1"), 0u);
     daemon.fits = [](uint32_t peer_id, size_t bytes) { return peer_id == 3 && bytes < 200; };
     query(3, GROUP, bn_query_iterate, bn_qf_subtree);
     EXPECT_EQ(code(), static_cast<uint32_t>(LC_NO_BUFFER_SPACE));

@@ -8,10 +8,9 @@
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/supervise.h"
+#include "tests/support/texts.h"
 
 namespace {
-
-using strings = std::vector<std::string>;
 
 // "tunneld", which takes over, is "sleep 100". Time moves only when a test moves it.
 struct Supervision : testing::Test {
@@ -22,7 +21,14 @@ struct Supervision : testing::Test {
     child *tunneld = nullptr;
 
     void SetUp() override {
-        attach(&self);
+        self.now_ms = [this] { return now; };
+        self.say = [this](const std::string &line) { said += line + "\n"; };
+        self.report = [this](const std::string &event, const std::string &process) {
+            events.push_back(process + event);
+        };
+        self.restarted = [this](const std::string &process, const std::string &last_end) {
+            restarts.push_back(process + " " + last_end);
+        };
         self.children = {{"tunneld", {"sleep", "100"}}};
         tunneld = &self.children[0];
         tunneld->takes_over = true;
@@ -32,26 +38,13 @@ struct Supervision : testing::Test {
         if (tunneld->pidfd >= 0)
             (void)end(SIGKILL, 0);
     }
-    void attach(supervisor *to) {
-        to->now_ms = [this] { return now; };
-        to->say = [this](const std::string &line) { said += line + "\n"; };
-        to->report = [this](const std::string &event, const std::string &process) {
-            events.push_back(process + event);
-        };
-        to->restarted = [this](const std::string &process, const std::string &last_end) {
-            restarts.push_back(process + " " + last_end);
-        };
-    }
     void open_session() { supervisor_session_opened(&self, "tunneld-" + std::to_string(tunneld->pid)); }
-    static void await_end(supervisor *of) {
-        pollfd ended = {of->children[0].pidfd, POLLIN, 0};
-        EXPECT_EQ(poll(&ended, 1, 5000), 1);
-    }
     // Ends the process after a run of that length. Returns the time until the next tick.
     int64_t end(int signal, int64_t ran_ms) {
         now += ran_ms;
         kill(tunneld->pid, signal);
-        await_end(&self);
+        pollfd ended = {tunneld->pidfd, POLLIN, 0};
+        EXPECT_EQ(poll(&ended, 1, 5000), 1);
         supervisor_reap(&self);
         return supervisor_tick(&self) - now;
     }
@@ -70,37 +63,6 @@ TEST_F(Supervision, AnEndHasItsNameAndTheNextStartItsDelay) {
     EXPECT_STREQ(end_event(SIGTERM, false), EVENT_PROCESS_TERMINATE);
     EXPECT_STREQ(end_event(W_EXITCODE(1, 0), false), EVENT_PROCESS_EXIT);
     EXPECT_STREQ(end_event(W_EXITCODE(0, 0), true), EVENT_PROCESS_TERMINATE);
-}
-
-// After mgmtd was killed: the child of the killed one must end before the next is started.
-TEST_F(Supervision, AnEarlierRunEndsFirst) {
-    supervisor earlier = self;
-    for (supervisor *each : {&earlier, &self})
-        each->children[0].lock_file = "/tmp/slow.lock";
-    (void)supervisor_tick(&earlier);
-    said.clear();
-    EXPECT_EQ(supervisor_tick(&self), now + EARLIER_RUN_EVERY_MS);
-    (void)tick(EARLIER_RUN_EVERY_MS);
-    EXPECT_EQ(said, "process tunneld: an earlier one still runs; waits for its end\n");
-    kill(earlier.children[0].pid, SIGKILL); // its end counts before it has been reaped
-    await_end(&earlier);
-    (void)tick(EARLIER_RUN_EVERY_MS);
-    EXPECT_FALSE(supervisor_is_done(self));
-    earlier.ending = true;
-    supervisor_reap(&earlier);
-    EXPECT_TRUE(supervisor_is_done(earlier));
-    unlink("/tmp/slow.lock");
-}
-
-// Its process ID may have been reused.
-TEST_F(Supervision, AChildReapedElsewhereHasEnded) {
-    tunneld->takes_over = false;
-    (void)supervisor_tick(&self);
-    kill(tunneld->pid, SIGKILL);
-    ASSERT_EQ(waitpid(tunneld->pid, nullptr, 0), tunneld->pid);
-    supervisor_reap(&self);
-    EXPECT_TRUE(supervisor_is_done(self));
-    EXPECT_EQ(events, strings{"tunneld" EVENT_PROCESS_EXIT});
 }
 
 // tunneld is killed: the loss is reported unless the next one has its session in time.
@@ -124,7 +86,7 @@ TEST_F(Supervision, ALossIsReportedUnlessTheNextTakesOverInTime) {
     (void)tick(TAKE_OVER_MS - 10);
     EXPECT_EQ(events, strings{"tunneld" EVENT_PROCESS_CRASH});
     open_session();
-    EXPECT_EQ(said.find("replaced after 30"), std::string::npos) << said;
+    EXPECT_TRUE(lacks(said, "replaced after 30"));
     // One that ends soon after it has taken over is restarted with a delay.
     EXPECT_GT(end(SIGKILL, SHORT_RUN_MS - 1), 0);
     EXPECT_TRUE(supervisor_is_done(self));

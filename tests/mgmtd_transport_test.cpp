@@ -10,8 +10,11 @@
 #include "peers/mgmtd/transport.h"
 #include "runtime/ttime.h"
 #include "tests/support/gcl_provider.h" // wire, be, padded, frame_bytes, number_at
+#include "tests/support/texts.h"
 
 namespace {
+const std::string DIRECTORY = "/tmp/gcl-socks", SOCKET = DIRECTORY + "/uds-provider-mgmtd";
+
 struct raw_client {
     int fd = -1;
     wire got;
@@ -21,7 +24,7 @@ struct raw_client {
         fd = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
         sockaddr_un address{};
         address.sun_family = AF_UNIX;
-        strcpy(address.sun_path, "/tmp/gcl-socks/uds-provider-mgmtd");
+        strcpy(address.sun_path, SOCKET.c_str());
         const auto length = static_cast<socklen_t>(strlen(address.sun_path) + 3);
         EXPECT_EQ(connect(fd, reinterpret_cast<sockaddr *>(&address), length), 0) << strerror(errno);
     }
@@ -70,16 +73,23 @@ wire query_frame(const std::vector<wire> &parts, uint32_t subop, uint32_t flags)
     return frame_bytes(2, 1, body, 2000003);
 }
 
+wire query_for_mode() {
+    return query_frame({"qv", "tunneld", "system", "config", "mode"}, 1, 0);
+}
+
 struct Transport : testing::Test {
     server daemon;
     transport sockets;
-    std::vector<std::string> lines;
+    strings lines;
     int64_t now = 0;
 
     void SetUp() override {
         daemon.now_ms = [this] { return now; };
         daemon.say = [this](const std::string &line) { lines.push_back(line); };
         tree_refresh(&daemon.tree);
+        listen();
+    }
+    void listen() {
         std::string error;
         ASSERT_TRUE(transport_listen(&sockets, &daemon, &error)) << error;
     }
@@ -103,12 +113,11 @@ struct Transport : testing::Test {
         pump(client);
         client->put(greeting_response(name) + open_service(2));
         pump(client);
-        EXPECT_FALSE(client->take().empty());
-        EXPECT_FALSE(client->take().empty());
+        EXPECT_TRUE(!client->take().empty() && !client->take().empty());
         EXPECT_EQ(lines.back(), "session of " + name + " open");
     }
     wire ask_for_mode(raw_client *client) {
-        client->put(query_frame({"qv", "tunneld", "system", "config", "mode"}, 1, 0));
+        client->put(query_for_mode());
         pump(client);
         return client->take();
     }
@@ -140,7 +149,7 @@ TEST_F(Transport, OpeningByTheByte) {
     EXPECT_EQ(number_at(client.take(), 32 + 44), 0u) << "granted";
 
     // In two pieces, and two at once.
-    const wire query = query_frame({"qv", "tunneld", "system", "config", "mode"}, 1, 0);
+    const wire query = query_for_mode();
     client.put(query.substr(0, 20));
     pump();
     client.put(query.substr(20));
@@ -153,9 +162,7 @@ TEST_F(Transport, OpeningByTheByte) {
                       text_on_wire("config") + text_on_wire("mode") + be(1, 4) + be(4, 4) + be(1, 4) +
                       be(101, 4) + be(0, 4) + text_on_wire("router") + be(1, 4);
     EXPECT_EQ(response, frame_bytes(2, 2, body, 1000004));
-    EXPECT_FALSE(client.take().empty());
-    EXPECT_FALSE(client.take().empty());
-    EXPECT_TRUE(client.take().empty());
+    EXPECT_TRUE(!client.take().empty() && !client.take().empty() && client.take().empty());
 }
 
 TEST_F(Transport, WhatCantBeTrueEndsItsSessionAndNoOther) {
@@ -165,35 +172,29 @@ TEST_F(Transport, WhatCantBeTrueEndsItsSessionAndNoOther) {
     const auto with_total = [&](uint32_t total) {
         return sound.substr(0, 12) + be(total, 4) + sound.substr(16);
     };
-    const struct {
-        const char *what;
-        bool opened;
-        wire bytes;
-    } cases[] = {
-        {"a length of 31", true, with_total(31)},
-        {"a length of 4 GiB", true, with_total(UINT32_MAX)},
-        {"another ident", true, "X" + sound.substr(1)},
-        {"another version", true, sound.substr(0, 8) + be(2, 4) + sound.substr(12)},
-        {"a node count without nodes", true,
-         frame_bytes(2, 1,
-                     be(2, 2) + be(1, 2) + be(0, 4) + be(9, 4) + be(10, 4) + be(0, 4) + be(UINT32_MAX, 4))},
-        {"an unknown protocol", true, frame_bytes(9, 1, "x")},
-        {"a query before the service is open", false, sound},
-        {"a name of no characters", false, greeting_response("")},
-        {"somebody else's user", false, greeting_response("mgmtctl-1", geteuid() + 1)},
-        {"a service before the greeting", false, open_service(2)},
-        {"a large frame before the service is open", false, with_total(OPENING_FRAME_MAX + 1)},
-    };
-    for (const auto &one : cases) {
+    const auto check = [&](const char *what, bool opened, const wire &bytes) {
         raw_client client;
-        if (one.opened)
+        if (opened)
             open(&client, "mgmtctl-2");
         pump(&client);
-        client.put(one.bytes);
+        client.put(bytes);
         pump(&client);
-        EXPECT_TRUE(client.closed) << one.what;
-        EXPECT_EQ(sockets.sessions.size(), 1u) << one.what;
-    }
+        EXPECT_TRUE(client.closed) << what;
+        EXPECT_EQ(sockets.sessions.size(), 1u) << what;
+    };
+    check("a length of 31", true, with_total(31));
+    check("a length of 4 GiB", true, with_total(UINT32_MAX));
+    check("another ident", true, "X" + sound.substr(1));
+    check("another version", true, sound.substr(0, 8) + be(2, 4) + sound.substr(12));
+    check("a node count without nodes", true,
+          frame_bytes(2, 1,
+                      be(2, 2) + be(1, 2) + be(0, 4) + be(9, 4) + be(10, 4) + be(0, 4) + be(UINT32_MAX, 4)));
+    check("an unknown protocol", true, frame_bytes(9, 1, "x"));
+    check("a query before the service is open", false, sound);
+    check("a name of no characters", false, greeting_response(""));
+    check("somebody else's user", false, greeting_response("mgmtctl-1", geteuid() + 1));
+    check("a service before the greeting", false, open_service(2));
+    check("a large frame before the service is open", false, with_total(OPENING_FRAME_MAX + 1));
     EXPECT_FALSE(ask_for_mode(&bystander).empty());
 }
 
@@ -217,7 +218,7 @@ TEST_F(Transport, AClientThatDoesNotReadLosesItsSessionOnly) {
     } while (grown > 1000);
     EXPECT_GT(before, QUEUE_MAX_BYTES * 9 / 10);
     EXPECT_TRUE(grown > 0 && before + grown <= QUEUE_MAX_BYTES);
-    EXPECT_NE(client.queue.back().find("Too much waits for you to read it"), wire::npos);
+    EXPECT_TRUE(contains(client.queue.back(), "Too much waits for you to read it"));
     tbuffer *event = nullptr; // which nobody waits for
     const auto left = static_cast<uint32_t>(QUEUE_MAX_BYTES - before);
     ASSERT_TRUE(tb_new_size(&event, left) == LC_OK && tb_set_length(event, left) == LC_OK);
@@ -281,11 +282,10 @@ TEST_F(Transport, MembersOfTheGroupMayLook) {
     if (getegid() != 0 || !as_user(65534, 65534, [] {}))
         GTEST_SKIP() << "only one user is known here";
     transport_close(&sockets);
-    std::string error;
     sockets.place.viewers_group = "daemon";
-    ASSERT_TRUE(transport_listen(&sockets, &daemon, &error)) << error;
+    listen();
     struct stat about;
-    ASSERT_EQ(stat("/tmp/gcl-socks/uds-provider-mgmtd", &about), 0);
+    ASSERT_EQ(stat(SOCKET.c_str(), &about), 0);
     EXPECT_EQ(about.st_mode & 07777, 0660u);
     EXPECT_EQ(about.st_gid, group);
 
@@ -302,7 +302,7 @@ TEST_F(Transport, MembersOfTheGroupMayLook) {
     open_as(group, 65534).put(greeting_response("wccpd-1", 65534));
     pump(&viewers.back());
     EXPECT_TRUE(viewers.back().closed);
-    chmod("/tmp/gcl-socks/uds-provider-mgmtd", 0666);
+    chmod(SOCKET.c_str(), 0666);
     EXPECT_TRUE(open_as(65534, 65534).closed);
     EXPECT_EQ(lines.back(), "session refused: user 65534");
     for (size_t i = 1; i <= VIEWER_SESSIONS_MAX; i++)
@@ -314,11 +314,10 @@ TEST_F(Transport, MembersOfTheGroupMayLook) {
 
 TEST_F(Transport, TheSocketIsOursAlone) {
     struct stat about;
-    ASSERT_EQ(stat("/tmp/gcl-socks/uds-provider-mgmtd", &about), 0);
-    EXPECT_EQ(about.st_mode & 07777, 0600u);
+    ASSERT_EQ(stat(SOCKET.c_str(), &about), 0);
     EXPECT_EQ(about.st_uid, geteuid());
-    ASSERT_EQ(stat("/tmp/gcl-socks", &about), 0);
-    EXPECT_EQ(about.st_mode & 07777, 0755u);
+    EXPECT_EQ(mode_of(SOCKET), 0600);
+    EXPECT_EQ(mode_of(DIRECTORY), 0755);
 
     const auto attempt = [&] {
         server other;
@@ -337,34 +336,31 @@ TEST_F(Transport, TheSocketIsOursAlone) {
         EXPECT_EQ(attempt(), "another mgmtd runs");
         now += LISTENER_CHECK_MS;
         pump();
-        EXPECT_TRUE(std::count(lines.begin(), lines.end(),
-                               "/tmp/gcl-socks/uds-provider-mgmtd was removed and has been made again"))
+        EXPECT_TRUE(contains(joined(lines, "\n"), SOCKET + " was removed and has been made again"))
             << command;
         lines.clear();
         raw_client client;
         open(&client, "wccpd-1");
     }
     transport_close(&sockets);
-    EXPECT_NE(stat("/tmp/gcl-socks/uds-provider-mgmtd", &about), 0) << "removed at the end";
+    EXPECT_EQ(mode_of(SOCKET), -1) << "removed at the end";
     // What can't be removed, and what one that was killed has left.
-    ASSERT_EQ(system("mkdir -p /tmp/gcl-socks/uds-provider-mgmtd/kept"), 0);
+    ASSERT_EQ(system(("mkdir -p " + SOCKET + "/kept").c_str()), 0);
     EXPECT_EQ(attempt(), "listens");
-    std::ofstream("/tmp/gcl-socks/uds-provider-mgmtd") << "";
-    chmod("/tmp/gcl-socks", 0777);
+    std::ofstream(SOCKET) << "";
+    chmod(DIRECTORY.c_str(), 0777);
     EXPECT_EQ(attempt(), "listens");
-    ASSERT_EQ(stat("/tmp/gcl-socks", &about), 0);
-    EXPECT_EQ(about.st_mode & 07777, 0755u) << "what others could write to is closed";
+    EXPECT_EQ(mode_of(DIRECTORY), 0755) << "what others could write to is closed";
     for (const char *aside : {"/tmp/gcl-socks.moved-1", "/tmp/gcl-socks.moved-2"})
-        if (chown("/tmp/gcl-socks", 1, 1) == 0) { // not where only one user is known
+        if (chown(DIRECTORY.c_str(), 1, 1) == 0) { // not where only one user is known
             EXPECT_EQ(attempt(), "listens");
             EXPECT_EQ(lines.back(), wire("/tmp/gcl-socks belonged to user 1, moved to ") + aside);
             ASSERT_EQ(stat(aside, &about), 0);
             EXPECT_EQ(about.st_uid, 1u);
         }
-    ASSERT_EQ(rename("/tmp/gcl-socks", "/tmp/elsewhere"), 0);
-    ASSERT_EQ(symlink("/tmp/elsewhere", "/tmp/gcl-socks"), 0);
+    ASSERT_EQ(system("mv /tmp/gcl-socks /tmp/elsewhere && ln -s /tmp/elsewhere /tmp/gcl-socks"), 0);
     EXPECT_EQ(attempt(), "/tmp/gcl-socks: Not a directory");
-    unlink("/tmp/gcl-socks");
+    unlink(DIRECTORY.c_str());
 }
 
 TEST_F(Transport, WhatKilledClientsLeftIsRemovedAndNothingElse) {
@@ -372,22 +368,22 @@ TEST_F(Transport, WhatKilledClientsLeftIsRemovedAndNothingElse) {
     if (gone == 0)
         _exit(0);
     waitpid(gone, nullptr, 0);
-    const wire directory = "/tmp/gcl-socks/", dead = "uds-client-wccpd-" + std::to_string(gone);
-    const wire alive = "uds-client-wccpd-" + std::to_string(getpid()),
-               other = "uds-client-wccpd-x" + std::to_string(gone);
+    const wire clients = DIRECTORY + "/uds-client-", dead = clients + "wccpd-" + std::to_string(gone),
+               alive = clients + "wccpd-" + std::to_string(getpid()),
+               other = clients + "wccpd-x" + std::to_string(gone),
+               file = clients + "file-" + std::to_string(gone);
     for (const wire &name : {dead, alive, other}) {
         const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
         sockaddr_un address{};
         address.sun_family = AF_UNIX;
-        strcpy(address.sun_path, (directory + name).c_str());
+        strcpy(address.sun_path, name.c_str());
         EXPECT_EQ(bind(fd, reinterpret_cast<sockaddr *>(&address), sizeof address), 0);
         close(fd);
     }
-    const wire file = "uds-client-file-" + std::to_string(gone);
-    std::ofstream(directory + file) << "";
+    std::ofstream(file) << "";
     raw_client client;
     pump(&client);
-    EXPECT_NE(access((directory + dead).c_str(), F_OK), 0);
-    for (const wire &name : {alive, other, file, wire("uds-provider-mgmtd")})
-        EXPECT_EQ(access((directory + name).c_str(), F_OK), 0) << name;
+    EXPECT_EQ(mode_of(dead), -1);
+    for (const wire &name : {alive, other, file, SOCKET})
+        EXPECT_NE(mode_of(name), -1) << name;
 }

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <algorithm>
+#include <cctype>
 #include <cstdlib>
 #include <fstream>
 #include <initializer_list>
@@ -16,15 +17,10 @@
 #include "mgmt/mdc_main.h"
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
+#include "tests/support/texts.h"
 
-inline const std::string GROUP = "/qv/wccpd/wccp/srv_grp/config/51";
+inline const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config/", GROUP = GROUPS + "51";
 inline const std::string STATE = "/qv/wccpd/wccp/srv_grp/state";
-
-using strings = std::vector<std::string>;
-
-inline bool has(const strings &list, const std::string &wanted) {
-    return std::find(list.begin(), list.end(), wanted) != list.end();
-}
 
 inline node_name named(const std::string &text) {
     node_name out;
@@ -112,18 +108,18 @@ struct Mgmtd : testing::Test {
     void open(uint32_t peer_id, const char *name) { server_peer_opened(&daemon, peer_id, name); }
     void close(uint32_t peer_id) { server_peer_closed(&daemon, peer_id); }
     // The changes that wccpd gets after an action, after an event about group 51, or after that time.
-    strings act(const char *name, const std::vector<event_field> &fields = {}) {
+    std::string act(const char *name, const std::vector<event_field> &fields = {}) {
         clear();
         action(3, name, fields);
         return changes();
     }
-    strings report(uint32_t peer_id, const char *event, std::vector<event_field> fields = {}) {
+    std::string report(uint32_t peer_id, const char *event, std::vector<event_field> fields = {}) {
         fields.push_back({"group", {bn_type_uint8, "51"}});
         clear();
         EXPECT_TRUE(give(peer_id, make_event(event, fields)));
         return changes();
     }
-    strings tick(int64_t after_ms) {
+    std::string tick(int64_t after_ms) {
         clear();
         now += after_ms;
         (void)server_tick(&daemon);
@@ -171,6 +167,35 @@ struct Mgmtd : testing::Test {
         EXPECT_TRUE(give(asker, msg));
         return code();
     }
+    // The same from words: NAME=VALUE modifies, +NAME=VALUE creates, -NAME deletes. The name is below group
+    // 51 unless it begins with "/", or with the number of a group.
+    uint32_t set(const std::string &steps, uint32_t commit_flags = 0, uint32_t revision = 0) {
+        std::vector<set_node> nodes;
+        std::istringstream words(steps);
+        for (std::string word; words >> word;) {
+            const size_t sign = word.find_first_not_of("+-"), end = std::min(word.find('='), word.size());
+            const std::string name = word.substr(sign, end - sign);
+            const bool deletes = word[0] == '-';
+            nodes.push_back({deletes ? bn_set_delete
+                             : sign  ? bn_set_create
+                                     : bn_set_modify,
+                             (name[0] == '/'     ? ""
+                              : isdigit(name[0]) ? GROUPS
+                                                 : GROUP + "/") +
+                                 name,
+                             word.substr(std::min(end + 1, word.size())),
+                             deletes ? bn_type_none : bn_type_str});
+        }
+        return set(nodes, commit_flags, revision);
+    }
+    // Starts with the file as it is; returns the warnings.
+    std::string load() {
+        std::string errors, warnings;
+        EXPECT_TRUE(server_load(&daemon, &errors, &warnings)) << errors;
+        server_begin(&daemon);
+        return warnings;
+    }
+    void write(const std::string &content) const { std::ofstream(daemon.file.path) << content; }
     const bn_response_msg *last_response() {
         for (auto at = sent.rbegin(); at != sent.rend(); ++at)
             if (at->response)
@@ -201,7 +226,8 @@ struct Mgmtd : testing::Test {
         std::erase_if(out, [](const std::string &node) { return node.find("/since=") != std::string::npos; });
         return out;
     }
-    // The change events that were sent to the peer: "name=old>new", "-" for none.
+    // The change events that were sent to the peer: "name=old>new", "-" for none; the names of nodes of
+    // groups begin with the group's number.
     std::vector<strings> events(uint32_t peer_id = 1) {
         std::vector<strings> out;
         for (const sent_message &one : sent) {
@@ -219,31 +245,29 @@ struct Mgmtd : testing::Test {
                 const bn_binding *binding = bn_binding_array_get_quick(new_values.pointer, i);
                 const bn_binding *old_value = nullptr;
                 uint32_t flags = 0;
-                (void)bn_binding_array_get_binding_by_name(old_values.pointer, name_of(binding).c_str(),
-                                                           &old_value);
                 (void)bn_binding_get_type(binding, bn_attrib_value, nullptr, &flags);
-                out.back().push_back(name_of(binding) + "=" + (old_value ? value_of(old_value).text : "-") +
-                                     ">" + (flags & bn_flag_deleted ? "-" : value_of(binding).text));
+                const std::string name = name_of(binding);
+                (void)bn_binding_array_get_binding_by_name(old_values.pointer, name.c_str(), &old_value);
+                out.back().push_back(name.substr(name.starts_with(GROUPS) ? GROUPS.size() : 0) + "=" +
+                                     (old_value ? value_of(old_value).text : "-") + ">" +
+                                     (flags & bn_flag_deleted ? "-" : value_of(binding).text));
             }
         }
         return out;
     }
-    strings changes() {
+    // Those sent to wccpd, separated by blanks.
+    std::string changes() {
         strings out;
         for (const strings &event : events())
             out.insert(out.end(), event.begin(), event.end());
-        return out;
+        return joined(out, " ");
     }
     // Writes the file and has mgmtd read it again.
     void reload(const std::string &content) {
-        std::ofstream(daemon.file.path) << content;
+        write(content);
         clear();
         said.clear();
         server_reload(&daemon);
     }
-    std::string content() const {
-        std::ostringstream out;
-        out << std::ifstream(daemon.file.path).rdbuf();
-        return out.str();
-    }
+    std::string content() const { return text_of_file(daemon.file.path); }
 };
