@@ -9,18 +9,14 @@
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/metrics.h"
 #include "peers/nodes/schema.h"
+#include "tests/support/canned_nodes.h"
 #include "tests/support/texts.h"
 
 static const std::string STATES = "/qv/wccpd/wccp/srv_grp/state";
 
 static metric_source answered_by(const std::vector<ctl_binding> &nodes) {
-    return [nodes](ctl_walk walk, const std::vector<std::string> &names, ctl_reply *out) {
-        for (const ctl_binding &node : nodes)
-            for (const std::string &name : names)
-                if (node.name == name ? walk != ctl_walk::children
-                                      : walk != ctl_walk::node && node.name.starts_with(name + "/"))
-                    out->bindings.push_back(node);
-        return true;
+    return [known = canned_nodes{nodes}](ctl_walk walk, const strings &names, ctl_reply *out) mutable {
+        return std::ranges::all_of(names, [&](const auto &name) { return known(walk, name, out); });
     };
 }
 

@@ -16,6 +16,7 @@
 #include "peers/mgmtctl/show_json.h"
 #include "peers/mgmtctl/show_texts.h"
 #include "runtime/common.h"
+#include "tests/support/canned_nodes.h"
 #include "tests/support/texts.h"
 
 namespace {
@@ -25,40 +26,10 @@ using json = nlohmann::json;
 const std::string CONFIG = "/qv/wccpd/wccp/srv_grp/config/", STATE = "/qv/wccpd/wccp/srv_grp/state/";
 const std::string ALARM = "/qv/alarms/state/raised/196638/eth0:grp:51";
 
-// Answers like mgmtd and wccpd: a walk of appliances finds none, their numbers are asked for.
-struct canned {
-    std::vector<ctl_binding> nodes; // in the order of their names
-    uint32_t wccpd_code = 0;
-    size_t asked = 0, lost_after = SIZE_MAX;
-
-    void add(const std::string &name, const std::string &value) { nodes.push_back({name, "string", value}); }
-
-    bool answer(ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
-        if (asked++ >= lost_after) {
-            *out_reason = "mgmtd closed the session";
-            return false;
-        }
-        if (name.find("/state") != std::string::npos && name.starts_with("/qv/wccpd"))
-            out->code = wccpd_code;
-        if (out->code != 0)
-            return true;
-        for (const ctl_binding &node : nodes) {
-            const bool below = node.name.starts_with(name + "/");
-            const bool child = below && node.name.find('/', name.size() + 1) == std::string::npos;
-            if (walk == ctl_walk::node ? node.name == name : walk == ctl_walk::children ? child : below)
-                out->bindings.push_back(node);
-        }
-        return true;
-    }
-    snapshot gather(const snapshot_limits &limits = {}) {
-        asked = 0;
-        return gather_snapshot(
-            [this](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
-                return answer(walk, name, out, out_reason);
-            },
-            limits);
-    }
-};
+snapshot gather(canned_nodes *from, const snapshot_limits &limits = {}) {
+    from->asked = 0;
+    return gather_snapshot(std::ref(*from), limits);
+}
 
 // Of a router: the first 64 buckets are A's, the others B's; the words as the engine has them.
 std::string hash_rows(const std::string &router) {
@@ -71,7 +42,7 @@ std::string hash_rows(const std::string &router) {
     return rows("10.0.0.101", all, none) + rows("10.0.0.102", none, all);
 }
 
-canned one_group() {
+canned_nodes one_group() {
     // C and S stand for the group's configuration and state; a router's nodes are those of R, its place
     // first.
     static const char *const lines =
@@ -82,7 +53,7 @@ canned one_group() {
         "S/num_appliances 2|R1 10.0.0.2 ONE 20|R2 10.0.0.1 TWO 25|"
         "S/appliance/1/ipaddr 10.0.0.101|S/appliance/1/weight 25|"
         "S/appliance/2/ipaddr 10.0.0.102|S/appliance/2/weight 75|";
-    canned from;
+    canned_nodes from;
     std::istringstream in(lines);
     for (std::string name, value; std::getline(in, name, ' ') && std::getline(in, value, '|');) {
         if (name[0] != 'R') {
@@ -114,37 +85,30 @@ canned one_group() {
     return from;
 }
 
-// 256 groups of 32 routers with 32 appliances each, made up as they are asked for.
-bool many(ctl_walk walk, const std::string &name, ctl_reply *out) {
-    const auto add = [&](const std::string &node, const std::string &value) {
-        out->bindings.push_back({node, "string", value});
-    };
-    if (name == NODE_PLANE_STATE)
-        add(name + "/name", "table");
-    else if (walk == ctl_walk::children && (name + "/" == CONFIG || name + "/" == STATE))
-        for (int i = 0; i < 256; i++)
-            add(name + "/" + std::to_string(i), std::to_string(i));
-    else if (name.ends_with("/router"))
-        for (int r = 1; r <= 32; r++) {
-            const std::string root = name + "/" + std::to_string(r);
-            add(root + "/state", "TWO-WAY connected");
-            add(root + "/ipaddr", "10.0.1." + std::to_string(r));
-            for (int a = 1; a <= 40; a++)
-                add(root + "/appliance/10.0.2." + std::to_string(a) + "/load_dist", "3");
+// 256 groups; the first 23 have 32 routers, each with 40 appliances.
+canned_nodes many_groups() {
+    canned_nodes from;
+    from.add(NODE_PLANE_STATE "/name", "table");
+    for (int i = 0; i < 256; i++) {
+        const std::string id = std::to_string(i), root = STATE + id;
+        from.add(CONFIG + id, id);
+        from.add(root, id);
+        for (const auto &[node, value] : {std::pair("/oper", "ACTIVE"),
+                                          {"/num_appliances", "4000000000"},
+                                          {"/num_routers", "31"},
+                                          {"/app_id", "10.0.2.1"}})
+            from.add(root + node, value);
+        for (int n = 1; n <= 64 && i < 23; n++) {
+            from.add(root + "/appliance/" + std::to_string(n) + "/ipaddr", "10.0.2." + std::to_string(n));
+            from.add(root + "/appliance/" + std::to_string(n) + "/weight", "1");
+            const std::string router = root + "/router/" + std::to_string(n);
+            for (int a = 1; a <= 40 && n <= 32; a++)
+                from.add(router + "/appliance/10.0.2." + std::to_string(a) + "/load_dist", "3");
+            if (n <= 32)
+                from.add(router + "/ipaddr", "10.0.1." + std::to_string(n));
         }
-    else if (walk == ctl_walk::children && name.starts_with(STATE)) {
-        add(name + "/oper", "ACTIVE");
-        add(name + "/num_appliances", "4000000000");
-    } else if (name.ends_with("/oper") || name.ends_with("/num_routers") || name.ends_with("/app_id"))
-        add(name, name.ends_with("oper") ? "ACTIVE" : name.ends_with("id") ? "10.0.2.1" : "31");
-    else if (name.ends_with("/router/1/appliance/10.0.2.1/load_dist"))
-        add(name, "3");
-    else if (name.find("/appliance/") != std::string::npos)
-        add(name,
-            name.ends_with("weight")
-                ? "1"
-                : "10.0.2." + name.substr(name.find("ance/") + 5, name.rfind('/') - name.find("ance/") - 5));
-    return true;
+    }
+    return from;
 }
 
 size_t columns_of(const std::string &line) {
@@ -166,7 +130,8 @@ std::string lines_of(const snapshot &shown) {
 }
 
 TEST(Show, TellsTheWholeOfAGroup) {
-    const snapshot shown = one_group().gather();
+    canned_nodes from = one_group();
+    const snapshot shown = gather(&from);
     const json all = json::parse(draw_json(shown)), group = all["groups"][0];
     ASSERT_EQ(group["routers"].size(), 3u);
     const json router = group["routers"][0], self = group["appliances"][0], table = group["tables"][0];
@@ -201,48 +166,43 @@ TEST(Show, TellsTheWholeOfAGroup) {
 }
 
 TEST(Show, NothingOfATextReachesTheTerminalAsAControl) {
-    canned from = one_group();
+    canned_nodes from = one_group();
     for (ctl_binding &node : from.nodes)
         if (node.name.find("/state") != std::string::npos && !node.name.ends_with("/oper"))
             node.value += "\033[2J\x9b"
                           "1m\r\n";
-    const snapshot shown = from.gather();
+    const snapshot shown = gather(&from);
     for (const std::string &text : {screen_of(shown), lines_of(shown), draw_json(shown)})
         for (const char c : text)
             ASSERT_TRUE(c == '\n' || (c >= 0x20 && c < 0x7f)) << static_cast<int>(c) << " in " << text;
 }
 
 TEST(Show, IsEmptyAndSaysSoWhereverMgmtdGoes) {
-    canned from = one_group();
+    canned_nodes from = one_group();
     from.wccpd_code = LC_IO_TIMED_OUT;
-    EXPECT_EQ(from.gather().wccpd, wccpd_condition::silent);
+    EXPECT_EQ(gather(&from).wccpd, wccpd_condition::silent);
     EXPECT_EQ(from.asked, 11u) << "it is not asked again";
     from.wccpd_code = 0;
-    (void)from.gather();
+    (void)gather(&from);
     for (size_t all = from.asked, n = 0; n < all; n++) {
         from.lost_after = n;
-        const snapshot shown = from.gather();
+        const snapshot shown = gather(&from);
         EXPECT_TRUE(shown.groups.empty() && !shown.unreachable.empty());
     }
 }
 
 TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
-    size_t asked = 0;
-    const snapshot_query query = [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *) {
-        asked++;
-        return many(walk, name, out);
-    };
+    canned_nodes from = many_groups();
     snapshot_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
-    std::vector<std::string> lines = draw_screen(gather_snapshot(query, limits), {79, 23, true, true, ""});
-    EXPECT_LE(asked, 16u + 23u * 7);
+    std::vector<std::string> lines = draw_screen(gather(&from, limits), {79, 23, true, true, ""});
+    EXPECT_LE(from.asked, 16u + 23u * 7);
     ASSERT_EQ(lines.size(), 23u);
     EXPECT_TRUE(contains(lines[1], "routers 31/31  share 3%"));
     EXPECT_TRUE(contains(lines.back(), "and 235 groups not shown"));
 
-    asked = 0;
     limits = {.queries = 300};
-    const snapshot detailed = gather_snapshot(query, limits);
-    EXPECT_LE(asked, 300u + 70u);
+    const snapshot detailed = gather(&from, limits);
+    EXPECT_LE(from.asked, 300u + 70u);
     const json all = json::parse(draw_json(detailed));
     EXPECT_EQ(all["groups_total"], 256);
     EXPECT_EQ(all["groups"].size(), 5u);
@@ -309,7 +269,7 @@ TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
     };
     for (const auto &row : rows) {
         SCOPED_TRACE(row.value);
-        canned from = one_group();
+        canned_nodes from = one_group();
         std::erase_if(from.nodes, [&](const ctl_binding &node) {
             return node.name.ends_with("/router/3/ipaddr") ||
                    (*row.name && node.name == STATE + "51" + (row.name + 1)) ||
@@ -333,7 +293,7 @@ TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
             from.add(root, row.value);
         }
         from.add(NODE_PLANE_STATE "/name", "table");
-        const snapshot shown = from.gather();
+        const snapshot shown = gather(&from);
         EXPECT_TRUE(contains(explained(shown, 51, row.exit), row.said));
         EXPECT_TRUE(contains(screen_of(shown), row.screen));
         EXPECT_EQ(json::parse(draw_json(shown))["groups"][0]["tables"][0]["routers"].size(),
@@ -357,11 +317,11 @@ TEST(Show, AnAlarmHasTheReasonThatFitsIt) {
 }
 
 TEST(Show, WhatIsNotKnownIsNotSaid) {
-    canned from = one_group();
+    canned_nodes from = one_group();
     std::erase_if(from.nodes, [](const ctl_binding &node) { return node.name.starts_with(ALARM); });
     for (const uint32_t code : {LC_IO_CLOSED, LC_IO_TIMED_OUT}) {
         from.wccpd_code = code;
-        const snapshot shown = from.gather();
+        const snapshot shown = gather(&from);
         EXPECT_TRUE(lacks(screen_of(shown), "no alarm"));
         const json all = json::parse(draw_json(shown));
         EXPECT_TRUE(all["alarms_total"].is_null() && all["groups"][0]["state"].is_null());
@@ -369,12 +329,12 @@ TEST(Show, WhatIsNotKnownIsNotSaid) {
         (void)explained(shown, -1, 1);
     }
     from.lost_after = 0;
-    EXPECT_EQ(json::parse(explained(from.gather(), -1, 2, true))["reasons"][0]["reason"],
+    EXPECT_EQ(json::parse(explained(gather(&from), -1, 2, true))["reasons"][0]["reason"],
               "mgmtd-unreachable");
     from.lost_after = SIZE_MAX;
     snapshot_limits other;
     other.only = 52;
-    (void)explained(from.gather(other), 52, 2, true);
+    (void)explained(gather(&from, other), 52, 2, true);
 }
 
 TEST(Show, EveryReasonHasWordsAndIsInTheDocuments) {
@@ -394,7 +354,7 @@ TEST(Show, EveryReasonHasWordsAndIsInTheDocuments) {
 
 // P, T, I, G, L: of the data plane, a tunnel, an intercept, protection, a group that is out of its routers;
 // X: an intercept's configuration, A: an accepted source.
-void add_traffic(canned *from, const char *lines) {
+void add_traffic(canned_nodes *from, const char *lines) {
     static const std::map<char, const char *> roots = {
         {'P', NODE_PLANE_STATE},         {'T', NODE_TUNNEL_STATE},     {'I', NODE_INTERCEPT_STATE},
         {'L', NODE_ALARM_STATE "/left"}, {'X', NODE_INTERCEPT_CONFIG}, {'A', NODE_ACCEPT_CONFIG},
@@ -420,11 +380,11 @@ const char *const TRAFFIC =
     "A/10.0.0.8 10.0.0.8|A/10.0.0.8/router 0.0.0.0|";
 
 TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
-    canned from = one_group();
-    EXPECT_TRUE(contains(screen_of(from.gather()), "\n\ntunneld: no session\n"));
-    EXPECT_EQ(json::parse(draw_json(from.gather()))["traffic"]["clamped"], nullptr);
+    canned_nodes from = one_group();
+    EXPECT_TRUE(contains(screen_of(gather(&from)), "\n\ntunneld: no session\n"));
+    EXPECT_EQ(json::parse(draw_json(gather(&from)))["traffic"]["clamped"], nullptr);
     add_traffic(&from, TRAFFIC);
-    const snapshot shown = from.gather();
+    const snapshot shown = gather(&from);
     const std::string screen = screen_of(shown);
     EXPECT_TRUE(contains(screen, "51  left its routers", "  router 10.0.0.3        not asked\n",
                          "\ntraffic  data plane user  1 tunnel\n"
@@ -455,17 +415,15 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
     from.add(NODE_ACCEPT_CONFIG "/10.0.0.9", "10.0.0.9");
     for (ctl_binding &node : from.nodes)
         node.value = node.name.ends_with("/clamped") ? "1" : node.value;
-    const std::string lines = lines_of(from.gather());
+    const std::string lines = lines_of(gather(&from));
     EXPECT_TRUE(contains(lines, "note  group 51: the proxy is down: refused?[2J\n"));
     EXPECT_TRUE(lacks(lines, "fragments", "refused source"));
 }
 
 TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
-    canned from;
+    canned_nodes from;
     ctl_link link;
-    link.query = [&](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
-        return from.answer(walk, name, out, out_reason);
-    };
+    link.query = std::ref(from);
     ctl_options options;
     const auto tunnels = [&](int exit) { return printed([&] { return tell_tunnels(options, link); }, exit); };
     const auto intercepts = [&](const char *group, int exit) {

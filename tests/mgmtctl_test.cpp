@@ -21,6 +21,7 @@
 #include "peers/mgmtctl/render.h"
 #include "peers/mgmtctl/watch.h"
 #include "peers/nodes/binding_text.h"
+#include "tests/support/canned_nodes.h"
 #include "tests/support/gcl_provider.h"
 #include "tests/support/texts.h"
 
@@ -218,32 +219,7 @@ TEST(Changes, AWholeConfigurationIsItsDifference) {
 
 // --- Names
 
-// mgmtd and wccpd as far as queries go.
-struct queried_tree {
-    std::vector<ctl_binding> nodes;
-    int asked = 0;
-    size_t most = SIZE_MAX; // of nodes in an answer
-    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out) {
-        asked++;
-        node_name root;
-        if (!parse_node_name(name, &root))
-            return true;
-        for (const ctl_binding &binding : nodes) {
-            node_name node;
-            EXPECT_TRUE(parse_node_name(binding.name, &node));
-            const bool child = node.is_under(root) && node.parts.size() == root.parts.size() + 1;
-            if (walk == ctl_walk::node      ? node == root
-                : walk == ctl_walk::subtree ? node == root || node.is_under(root)
-                                            : child)
-                out->bindings.push_back(binding);
-        }
-        if (out->bindings.size() > most)
-            *out = {LC_NO_BUFFER_SPACE, "ask for less", {}};
-        return true;
-    }
-};
-
-static queried_tree sample() {
+static canned_nodes sample() {
     return {{{G51, "uint8", "51"},
              {G51 + "/weight", "uint32", "100"},
              {GROUPS + "/7", "uint8", "7"},
@@ -257,7 +233,7 @@ static queried_tree sample() {
 }
 
 TEST(Names, AreCompletedToTheirNextPart) {
-    queried_tree known = sample();
+    canned_nodes known = sample();
     const auto check = [&](const std::string &word, const std::string &found) {
         EXPECT_EQ(joined(completions(std::ref(known), word), " "), found);
     };
@@ -271,7 +247,7 @@ TEST(Names, AreCompletedToTheirNextPart) {
 }
 
 TEST(Names, AMistypedOneGetsAHint) {
-    queried_tree known = sample();
+    canned_nodes known = sample();
     const ctl_ask ask = std::ref(known);
     const auto check = [&](const std::string &name, const std::string &hint) {
         EXPECT_EQ(hint_for_missing(ask, name), hint);
@@ -289,11 +265,11 @@ TEST(Names, AMistypedOneGetsAHint) {
 }
 
 TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
-    queried_tree known = sample();
+    canned_nodes known = sample();
     std::vector<ctl_binding> many = {{STATES + "/51/num_appliances", "uint32", "4000000000"},
                                      {STATES + "/51/oper", "string", "x"}};
     ASSERT_TRUE(add_appliances(std::ref(known), STATES, &many));
-    EXPECT_EQ(known.asked, 64);
+    EXPECT_EQ(known.asked, 64u);
     EXPECT_EQ(many[1].value, "10.0.0.101") << "in their place";
     ctl_reply reply;
     ASSERT_TRUE(add_appliances(std::ref(known), STATES + "/51/appliance", &reply.bindings));
@@ -301,7 +277,7 @@ TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
 }
 
 TEST(Walks, WhatIsLargerThanAMessageComesInPieces) {
-    queried_tree known = sample();
+    canned_nodes known = sample();
     const auto names = [&](const std::string &root, uint32_t code) {
         node_name parsed;
         ctl_reply reply;
@@ -315,7 +291,7 @@ TEST(Walks, WhatIsLargerThanAMessageComesInPieces) {
         return out;
     };
     const strings all = names("/qv", LC_OK);
-    EXPECT_EQ(known.asked, 1);
+    EXPECT_EQ(known.asked, 1u);
     for (known.most = 3; known.most < 9; known.most++)
         EXPECT_EQ(names("/qv", LC_OK), all) << known.most;
     known.most = 0;

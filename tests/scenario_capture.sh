@@ -4,8 +4,7 @@
 #   scenario_capture.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
-export WCCP_BIN=${1:-$top/build/release/bin}
-export LAB_SPEED=${LAB_SPEED:-8}
+export WCCP_BIN=${1:-$top/build/release/bin} LAB_SPEED=${LAB_SPEED:-8}
 command -v tshark >/dev/null && command -v tcpdump >/dev/null || { echo "tshark or tcpdump is not installed"; exit 77; }
 scratch=$(mktemp -d)
 trap 'rm -rf "$scratch"' EXIT

@@ -5,9 +5,7 @@
 # promtool and prometheus are those in PATH or in build/tools (scripts/install-deps.sh metrics); skipped without them.
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
-export WCCP_BIN=${1:-$top/build/release/bin} PATH=$PATH:$top/build/tools
-: "${LAB_SPEED:=8}" "${LAB_PLANE=user}"
-export LAB_SPEED LAB_PLANE
+export WCCP_BIN=${1:-$top/build/release/bin} PATH=$PATH:$top/build/tools LAB_SPEED=${LAB_SPEED:-8} LAB_PLANE=${LAB_PLANE-user}
 for tool in promtool prometheus systemd-socket-activate; do
     command -v $tool >/dev/null || { echo "skipped: no $tool"; exit 77; }
 done

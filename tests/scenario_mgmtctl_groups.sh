@@ -4,8 +4,7 @@
 #   scenario_mgmtctl_groups.sh DIRECTORY_OF_THE_PROGRAMS
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
-export WCCP_BIN=${1:-$top/build/release/bin}
-export LAB_SPEED=${LAB_SPEED-8}
+export WCCP_BIN=${1:-$top/build/release/bin} LAB_SPEED=${LAB_SPEED-8}
 # shellcheck source=../lab/topology.sh
 source "$top/lab/topology.sh"
 lab_enter "$0" "$@"
@@ -48,25 +47,21 @@ expect 1 '.code == 14008 and .commits == 0' group add 51 interface eth0 router 1
 expect 0 '.done == "added" and .commits == 1 and .running and .state == "INIT"' \
     group add 51 interface eth0 router 10.0.0.1 weight 30 assign hash priority 10 password - <<<secret
 for router in r1 r2; do lab_ctl $router password secret >/dev/null; done
-expect 1 '.error | test("there is a group 51")' group add 51
 lab_wait_role 30 a1 51 ACTIVE || fail "the group did not become active"
 wait_shown '.groups[0] | .designated and .state == "ACTIVE" and .appliances[0].share_percent == 100'
-expect 0 '.groups[0].routers[0] | .connection == "two-way" and .assign == "hash" and
-    (.forward == "gre" or .forward == "l2") and .return and .shares["10.0.0.101"] == 100' show
 expect 0 '.groups[0] | .password and .link == "up" and .priority == 10 and .tables[0].kind == "hash" and
-    .tables[0].buckets == [{"first": 0, "last": 255, "appliance": "10.0.0.101"}]' show
+    .tables[0].buckets == [{"first": 0, "last": 255, "appliance": "10.0.0.101"}] and (.routers[0] | .connection == "two-way" and
+    .assign == "hash" and (.forward == "gre" or .forward == "l2") and .return and .shares["10.0.0.101"] == 100)' show
 expect 0 '.[0] | .weight == "30" and .password == "********" and .routers == ["10.0.0.1"]' group list
 
 # Changed in place.
 lab_mark a1
 expect 0 '.done == "changed" and .commits == 1 and .state == "ACTIVE" and .designated' group set 51 weight 7
 lab_wait 15 '.groups["51"].appliances[0].weight == 7' lab_ctl r1 show || fail "the weight did not reach the router"
-expect 0 '.done == "unchanged" and .commits == 0' group set 51 weight 7 router 10.0.0.1
 expect 0 '.done == "changed"' group set 51 weight default hash_dst_ip true
 ! lab_log a1 | grep -q 'Deleted Group' || fail "a change in place deleted the group"
 
 # Another router requires that the group is recreated, in one commit. A change that is refused leaves the group alone.
-expect 1 '.done == "nothing" and .code == 14008' group set 51 router 10.0.0.1 router 10.0.0.999
 expect 1 '.done == "nothing" and .code == 14002 and (.error | test("an address of this appliance"))' group set 51 router 10.0.0.101
 expect 1 '.done == "nothing" and (.error | test("four masks"))' group set 51 router 10.0.0.2 mask_src_ip 0xffff
 ! lab_log a1 | grep -q 'Deleted Group' || fail "a refused change deleted the group"
@@ -134,7 +129,6 @@ lab_wait_log 5 a1 'WCCP config: set priority to 20' || fail "wccpd did not log t
 expect 0 '.done == "recreated" and .commits == 1 and .running' group restart 51
 expect 0 '.done == "recreated" and .running' group set 51 policy none
 expect 0 '.done == "deleted"' policy delete 5
-expect 4 '.code == 14004' policy delete 5
 expect 0 '.done == "deleted" and (.running | not)' group delete 51
 expect 0 '.groups_total == 0 and .alarms_total == 0' show
 lab_end a1 a2 || exit 1

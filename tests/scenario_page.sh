@@ -5,8 +5,7 @@
 #   scenario_page.sh DIRECTORY_OF_THE_PROGRAMS
 #   LAB_PAGE   a directory to which the page is copied, with screenshots
 set -u
-: "${LAB_SPEED:=8}" "${LAB_PLANE=}"
-export WCCP_BIN=${1:-$(dirname "$0")/../build/release/bin} LAB_SPEED LAB_PLANE
+export WCCP_BIN=${1:-$(dirname "$0")/../build/release/bin} LAB_SPEED=${LAB_SPEED:-8} LAB_PLANE=${LAB_PLANE-}
 # shellcheck source=../lab/cases.sh
 source "$(dirname "${BASH_SOURCE[0]}")/../lab/cases.sh"
 lab_enter "$0" "$@"

@@ -1,0 +1,39 @@
+// mgmtd and wccpd as far as the queries of mgmtctl go: they have these nodes.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "peers/mgmtctl/session.h"
+#include "runtime/common.h"
+
+struct canned_nodes {
+    std::vector<ctl_binding> nodes;
+    size_t asked = 0;
+    size_t most = SIZE_MAX;       // of nodes in an answer
+    size_t lost_after = SIZE_MAX; // so many queries
+    uint32_t wccpd_code = 0;      // of its answers
+
+    void add(const std::string &name, const std::string &value) { nodes.push_back({name, "string", value}); }
+    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out) {
+        if (asked++ >= lost_after)
+            return false;
+        if (name.find("/state") != std::string::npos && name.starts_with("/qv/wccpd"))
+            out->code = wccpd_code;
+        const std::string above = name.ends_with('/') ? name : name + "/";
+        for (const ctl_binding &node : nodes) {
+            const bool below = node.name.starts_with(above);
+            if (out->code == 0 &&
+                (walk == ctl_walk::children ? below && node.name.find('/', above.size()) == std::string::npos
+                                            : node.name == name || (walk == ctl_walk::subtree && below)))
+                out->bindings.push_back(node);
+        }
+        if (out->bindings.size() > most)
+            *out = {LC_NO_BUFFER_SPACE, "ask for less", {}};
+        return true;
+    }
+    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
+        *out_reason = "mgmtd closed the session";
+        return (*this)(walk, name, out);
+    }
+};
