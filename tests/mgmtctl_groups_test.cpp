@@ -206,7 +206,6 @@ TEST(Bypasses, HaveOneNameAndEndByThemselves) {
         expect_refused(&fake::bypass, CTL_USAGE, words, told);
     };
     refuse("add 10.0.0.1/8", "host bits");
-    refuse("add 10.0.0", "is no IPv4 prefix");
     refuse("add 10.0.0.0/8 fro 60", "did you mean \"for\"?");
     refuse("add 10.0.0.0/8 for 0", "number of seconds");
     refuse("add 10.0.0.0/8 for 4294967296", "number of seconds");
@@ -228,7 +227,6 @@ TEST(Tunnels, FurtherSourcesAreAcceptedAndTakenBack) {
     };
     refuse("acept 10.0.0.9", "did you mean \"accept\"?");
     refuse("accept 10.0.0", "\"10.0.0\" is no IPv4 address");
-    refuse("accept 127.0.0.1", "is not the address of another host");
     refuse("accept 10.0.0.9 for 9", "known are router");
     refuse("refuse 10.0.0.9 router 10.0.0.1", "tunnel accept ADDRESS");
     fake mgmtd;

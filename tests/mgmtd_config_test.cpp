@@ -158,11 +158,6 @@ TEST_F(Mgmtd, TheFileIsReplacedOnlyIfNothingIsLost) {
         ASSERT_FALSE(config_load(&special, &text)) << kind;
         EXPECT_TRUE(contains(text.errors, "not a regular file"));
     }
-    const auto kept = daemon.tree.set;
-    daemon.file.path = std::string(file) + "/no/such/directory";
-    EXPECT_EQ(set("weight=9"), refused);
-    EXPECT_EQ(changes(), "");
-    EXPECT_EQ(daemon.tree.set, kept);
 }
 
 TEST_F(Mgmtd, AStartCleansUpAndReportsProblems) {
