@@ -222,29 +222,18 @@ lab_in a1 bash -c 'ip link add eth1 type veth peer name eth4; ip link add eth2 t
     ip address add 10.9.1.1/24 dev eth1; ip address add 10.9.3.1/24 dev eth3; ip link set eth2 up; ip link set eth3 up
     ip route add unreachable 10.8.0.0/16'
 lab_start a1 taker wccp_router --router 10.9.3.1 # occupies port 2048
-while read -r group words; do
-    # shellcheck disable=SC2086
+causes='60|interface eth9 router 10.0.0.1|interface-missing|no interface eth9
+61|interface eth0 router 10.0.0.77|no-answer|10.0.0.77 does not answer
+62||no-interface|has no interface
+63|interface eth0|no-router|has no router
+64|interface eth1 router 10.0.0.1|interface-down|eth1 is down
+65|interface eth2 router 10.0.0.1|interface-no-address|eth2 has no IPv4 address
+66|interface eth3 router 10.0.0.1|port-taken|2048 on eth3 is taken
+67|interface eth0 router 10.8.0.1|send-failed|sending to 10.8.0.1 fails: '
+while IFS='|' read -r group words _; do # shellcheck disable=SC2086
     ctl group add $group $words >/dev/null || fail "mgmtd refused group $group $words"
-done <<'GROUPS'
-60 interface eth9 router 10.0.0.1
-61 interface eth0 router 10.0.0.77
-62
-63 interface eth0
-64 interface eth1 router 10.0.0.1
-65 interface eth2 router 10.0.0.1
-66 interface eth3 router 10.0.0.1
-67 interface eth0 router 10.8.0.1
-GROUPS
-while read -r group code words; do explains "$group" "$code" "$words"; done <<'CAUSES'
-60 interface-missing no interface eth9
-61 no-answer 10.0.0.77 does not answer
-62 no-interface has no interface
-63 no-router has no router
-64 interface-down eth1 is down
-65 interface-no-address eth2 has no IPv4 address
-66 port-taken 2048 on eth3 is taken
-67 send-failed sending to 10.8.0.1 fails: 
-CAUSES
+done <<<"$causes"
+while IFS='|' read -r group _ code words; do explains "$group" "$code" "$words"; done <<<"$causes"
 [ "$(ctl get "${S%51}67/counter/tx_send_errors")" -gt 0 ] || fail "failed sends are not counted"
 # Each fault takes precedence over the earlier ones, whose reasons last for a while.
 while read -r broken code words; do
