@@ -187,10 +187,19 @@ TEST_F(Commands, RunOneAfterTheOtherWithAllTheirChildren) {
     EXPECT_EQ(said, path_of("10-first: exited with 3\n"));
 }
 
-// When the program ends, so does the running command, and no other is started.
-TEST_F(Commands, EndWithTheProgram) {
+TEST_F(Commands, EndWithTheirWholeGroupWhenTheyTakeTooLong) {
+    const auto alive = [&](const char *name) { return kill(std::stoi(read(name)), 0) == 0; };
     add("10-slow", "sleep 100 & echo $! >slow; wait\n");
-    add("20-next", "echo next >next\n");
+    add("20-stubborn", "trap '' TERM; sleep 100 & echo $! >stubborn; wait; wait\n");
+    add("30-next", "echo next >next\n");
+    EXPECT_EQ(run_notify_commands(run(400)), NOTIFY_TIMED_OUT);
+    EXPECT_FALSE(alive("slow") || alive("stubborn"));
+    EXPECT_EQ(read("next"), "next\n");
+    EXPECT_TRUE(contains(said, "/20-stubborn: not done after 0 s, ended\n"));
+
+    // When the program ends, so does the running command, and no other is started.
+    for (const char *name : {"next", "slow"})
+        unlink(path_of(name).c_str());
     pid_t pid = 0;
     int pidfd = -1, status = 0;
     ASSERT_TRUE(start_notify_commands(run(60000), &pid, &pidfd));
@@ -201,7 +210,7 @@ TEST_F(Commands, EndWithTheProgram) {
     EXPECT_EQ(poll(&ended, 1, 8000), 1);
     ASSERT_EQ(waitpid(pid, &status, 0), pid);
     EXPECT_NE(WEXITSTATUS(status), NOTIFY_DONE);
-    EXPECT_NE(kill(std::stoi(read("slow")), 0), 0);
+    EXPECT_FALSE(alive("slow"));
     EXPECT_EQ(read("next"), "");
     close(pidfd);
 }

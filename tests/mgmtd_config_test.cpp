@@ -146,6 +146,7 @@ TEST_F(Mgmtd, TheFileIsReplacedOnlyIfNothingIsLost) {
     daemon.tree.set[hidden] = "debug";
     EXPECT_EQ(set("weight=9"), refused);
     EXPECT_TRUE(contains(message(), "would not be read as the same"));
+    EXPECT_EQ(changes(), "");
     EXPECT_EQ(content(), held);
     daemon.tree.set.erase(hidden);
     // Neither a device, which a commit would replace, nor a pipe, which would block, is a configuration file.

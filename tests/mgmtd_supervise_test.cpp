@@ -39,12 +39,15 @@ struct Supervision : testing::Test {
             (void)end(SIGKILL, 0);
     }
     void open_session() { supervisor_session_opened(&self, "tunneld-" + std::to_string(tunneld->pid)); }
+    static void await_end(const child &of) {
+        pollfd ended = {of.pidfd, POLLIN, 0};
+        EXPECT_EQ(poll(&ended, 1, 5000), 1);
+    }
     // Ends the process after a run of that length. Returns the time until the next tick.
     int64_t end(int signal, int64_t ran_ms) {
         now += ran_ms;
         kill(tunneld->pid, signal);
-        pollfd ended = {tunneld->pidfd, POLLIN, 0};
-        EXPECT_EQ(poll(&ended, 1, 5000), 1);
+        await_end(*tunneld);
         supervisor_reap(&self);
         return supervisor_tick(&self) - now;
     }
@@ -63,6 +66,36 @@ TEST_F(Supervision, AnEndHasItsNameAndTheNextStartItsDelay) {
     EXPECT_STREQ(end_event(SIGTERM, false), EVENT_PROCESS_TERMINATE);
     EXPECT_STREQ(end_event(W_EXITCODE(1, 0), false), EVENT_PROCESS_EXIT);
     EXPECT_STREQ(end_event(W_EXITCODE(0, 0), true), EVENT_PROCESS_TERMINATE);
+}
+
+// After mgmtd was killed: the child of the killed one must end before the next is started.
+TEST_F(Supervision, AnEarlierRunEndsFirst) {
+    tunneld->lock_file = "/tmp/slow.lock";
+    supervisor earlier = self;
+    (void)supervisor_tick(&earlier);
+    said.clear();
+    EXPECT_EQ(supervisor_tick(&self), now + EARLIER_RUN_EVERY_MS);
+    (void)tick(EARLIER_RUN_EVERY_MS);
+    EXPECT_EQ(said, "process tunneld: an earlier one still runs; waits for its end\n");
+    kill(earlier.children[0].pid, SIGKILL); // its end counts before it has been reaped
+    await_end(earlier.children[0]);
+    (void)tick(EARLIER_RUN_EVERY_MS);
+    EXPECT_FALSE(supervisor_is_done(self));
+    earlier.ending = true;
+    supervisor_reap(&earlier);
+    EXPECT_TRUE(supervisor_is_done(earlier));
+    unlink("/tmp/slow.lock");
+}
+
+// Its process ID may have been reused.
+TEST_F(Supervision, AChildReapedElsewhereHasEnded) {
+    tunneld->takes_over = false;
+    (void)supervisor_tick(&self);
+    kill(tunneld->pid, SIGKILL);
+    ASSERT_EQ(waitpid(tunneld->pid, nullptr, 0), tunneld->pid);
+    supervisor_reap(&self);
+    EXPECT_TRUE(supervisor_is_done(self));
+    EXPECT_EQ(events, strings{"tunneld" EVENT_PROCESS_EXIT});
 }
 
 // tunneld is killed: the loss is reported unless the next one has its session in time.

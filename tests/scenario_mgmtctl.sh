@@ -67,6 +67,8 @@ expect 0 "$G/weight = 100"$'\n'"$G/password = [*][*][*][*][*][*][*][*]" get $G/w
 expect 0 'jq:. == [{name: "'$G'/weight", type: "uint32", value: 100}, {name: "'$G'/password", type: "string", value: "geheim"}]' \
     get --json --secrets $G/weight $G/password
 expect 4 'jq:.[0].code == 14004 and .[0].hint == "did you mean '$G'/weight?" and .[1].value == 100' --json get $G/wieght $G/weight
+expect 4 '' get $G/policy_grp
+complains "mgmtctl: $G/policy_grp: is not set"$'\n'"*has no default"
 expect 4 '' walk /qv/nobody
 complains '*there is nothing below*'
 
@@ -108,6 +110,7 @@ expect 0 'jq:map(.value) == [9, 200, 127]' --json get $G/weight $G/priority $G/m
 expect 1 'jq:.name == "'$G'/password" and .code == 14008 and (.error | contains("123456789") | not)' --json set $G/password 123456789
 expect 4 '' set --existing "${G%51}52/weight" 1
 expect 4 '' set $S/oper=BACKUP
+complains '*it is a state: it can only be read'
 expect 0 "created ${G%51}52" set "${G%51}52/weight=1"
 expect 0 'jq:.changed == ["'"${G%51}52"'"] and .exit == 0' --json delete "${G%51}52"
 expect 4 '' delete "${G%51}52"

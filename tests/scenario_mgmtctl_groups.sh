@@ -129,6 +129,7 @@ lab_wait_log 5 a1 'WCCP config: set priority to 20' || fail "wccpd did not log t
 expect 0 '.done == "recreated" and .commits == 1 and .running' group restart 51
 expect 0 '.done == "recreated" and .running' group set 51 policy none
 expect 0 '.done == "deleted"' policy delete 5
+expect 4 '.code == 14004' policy delete 5
 expect 0 '.done == "deleted" and (.running | not)' group delete 51
 expect 0 '.groups_total == 0 and .alarms_total == 0' show
 lab_end a1 a2 || exit 1

@@ -33,7 +33,7 @@ case_changes() {
         mkdir -p $1/d $1/out && chmod 777 $1/out && mkdir -m 700 $1/state && chown nobody $1/state && cd $1/d
         printf "%s\n" "#!/bin/sh" "echo \"\$WCCP_KIND \$WCCP_PREVIOUS>\$WCCP_STATE \$WCCP_REASON\" >>$1/out/log" \
             "echo \"\$(id -u) \$WCCP_GROUP \$WCCP_ALARM \$WCCP_CAUSE\" >>$1/out/more" >10-log
-        printf "%s\n" "#!/bin/sh" "[ \$WCCP_KIND = alarm ] || exit 0" "trap \"\" TERM" "sleep 1000 & echo \$! >>$1/out/pid" wait wait >20-slow
+        printf "%s\n" "#!/bin/sh" "[ \$WCCP_KIND = alarm ] || exit 0" "sleep 1000 & echo \$! >>$1/out/pid" wait >20-slow
         echo "#!/bin/sh" >writable; chmod 755 10-log 20-slow; chmod 757 writable' - $run || die "no commands"
     lab_gateway a1 10.0.0.1
     lab_proxy a1 3129
