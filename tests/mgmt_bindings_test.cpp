@@ -1,32 +1,12 @@
 #include <gtest/gtest.h>
 
-#include <cstring>
-#include <string>
-#include <vector>
-
-#include "mgmt/bnode_proto.h"
 #include "tests/support/log_lines.h"
-#include "tests/support/owners.h"
+#include "tests/support/mgmt_owners.h"
+#include "tests/support/wire_bytes.h"
 
 namespace {
 
-using attrib_owner = owner<bn_attrib, bn_attrib_free>;
-using binding_owner = owner<bn_binding, bn_binding_free>;
-using bindings_owner = owner<bn_binding_array, bn_binding_array_free>;
-using parts_owner = owner<tstr_array, tstr_array_free>;
-using string_owner = owner<tstring, ts_free>;
-using buffer_owner = owner<tbuffer, tb_free>;
-
-std::string text(const tstring *string) {
-    return string ? std::string(string->buffer, static_cast<size_t>(string->length)) : "(null)";
-}
 using strings = std::vector<std::string>;
-strings list_of(const tstr_array *parts) {
-    strings all;
-    for (uint32_t i = 0; i < tstr_array_length_quick(parts); i++)
-        all.emplace_back(tstr_array_get_str_quick(parts, i));
-    return all;
-}
 
 // --- Text
 
@@ -81,11 +61,8 @@ const struct type_case {
     {103, 4, "00000003 78797a", "xyz", nullptr},
     {105, 4, "00000002 2e31", ".1", nullptr},
     {120, 4, "00000001 61", "a", nullptr},
-    {121, 4, "00000001 61", "a", nullptr},
     {130, 4, "0000000b 612d312e6578616d706c65", "a-1.example", "-a|a_b"},
     {131, 4, "00000001 61", "a", nullptr},
-    {132, 4, "00000001 61", "a", nullptr},
-    {133, 4, "00000001 61", "a", nullptr},
     {134, 4, "00000001 2a", "*", nullptr},
     {0x40005, 1, "00000004 00000000", "", nullptr},
     {0x180005, 1, "00000000", "", nullptr},
@@ -93,39 +70,76 @@ const struct type_case {
     {0x1004e, 1, nullptr, nullptr, "soon"},
     {91, 1, nullptr, nullptr, ""},
 };
-std::vector<std::string> split(const char *texts) {
-    std::vector<std::string> all;
+strings split(const char *texts) {
+    strings all;
     for (const char *end = texts; texts; texts = *end ? end + 1 : nullptr) {
         end = texts + strcspn(texts, "|");
         all.emplace_back(texts, end);
     }
     return all;
 }
+std::string from_hex(const std::string &digits) {
+    const std::vector<uint8_t> bytes = hex(digits).bytes;
+    return {bytes.begin(), bytes.end()};
+}
 lc_status set_text(bn_attrib *attrib, uint32_t type, const std::string &in) {
     return bn_attrib_set_str(attrib, 1, type & BN_TYPE_MASK, type & ~BN_TYPE_MASK, in.c_str());
 }
-TEST(Texts, BecomeValuesAndTextsAgain) {
-    log_lines log;
+std::string value_of(const bn_attrib *attrib) {
+    return text_of(
+        [&](char **out) { return bn_attrib_get_str(attrib, nullptr, attrib->type, nullptr, out); });
+}
+// From a buffer of exactly these bytes, so that the sanitizer sees a read past them.
+lc_status read_bytes(const std::string &bytes, bn_attrib **out) {
+    const std::vector<char> exact(bytes.begin(), bytes.end());
+    buffer_owner buffer;
+    EXPECT_EQ(tb_new_buf_const(&buffer, exact.data(), static_cast<uint32_t>(exact.size())), LC_OK);
+    return bn_attrib_read_wire(buffer, 0, out, nullptr);
+}
+// The attribute is written and read as these bytes, at an odd offset; anything shorter is refused.
+void expect_bytes(const bn_attrib *attrib, const std::string &golden) {
+    attrib_owner back;
+    buffer_owner buffer;
+    uint32_t used = 0;
+    int order = 1;
+    ASSERT_TRUE(tb_new(&buffer) == LC_OK && tb_append_uint8(buffer, 0xee) == LC_OK);
+    ASSERT_EQ(bn_attrib_append_wire(attrib, buffer), LC_OK);
+    EXPECT_EQ(bytes_of(buffer).substr(1), golden);
+    ASSERT_EQ(bn_attrib_read_wire(buffer, 1, &back, &used), LC_OK);
+    EXPECT_TRUE(used == golden.size() && back->value_size == attrib->value_size);
+    EXPECT_TRUE(bn_attrib_compare(attrib, back, &order) == LC_OK && order == 0);
+    EXPECT_EQ(back->type | back->type_flags, attrib->type | attrib->type_flags);
+    for (size_t length = 1; length < golden.size(); length++) {
+        attrib_owner none;
+        EXPECT_NE(read_bytes(golden.substr(0, length), &none), LC_OK) << length;
+        EXPECT_EQ(none.pointer, nullptr);
+    }
+}
+TEST(Values, TextsAndBytes) {
     for (const type_case &c : type_cases) {
+        const char *bytes = c.bytes;
         for (const std::string &row : split(c.texts)) {
+            SCOPED_TRACE(std::to_string(c.type) + " " + row);
             const size_t arrow = row.find(" -> ");
             attrib_owner attrib;
             ASSERT_EQ(bn_attrib_new(&attrib), LC_OK);
-            ASSERT_EQ(set_text(attrib, c.type, row.substr(0, arrow)), LC_OK) << c.type << row;
-            EXPECT_EQ(text_of([&](char **out) {
-                          return bn_attrib_get_str(attrib, nullptr, attrib->type, nullptr, out);
-                      }),
-                      arrow == std::string::npos ? row : row.substr(arrow + 4));
+            ASSERT_EQ(set_text(attrib, c.type, row.substr(0, arrow)), LC_OK);
+            EXPECT_EQ(value_of(attrib), arrow == std::string::npos ? row : row.substr(arrow + 4));
+            wire_bytes header;
+            header.u32(c.kind).u32(1).u32(c.type & BN_TYPE_MASK).u32(c.type & ~BN_TYPE_MASK);
+            if (bytes)
+                expect_bytes(attrib, std::string(header.bytes.begin(), header.bytes.end()) + from_hex(bytes));
+            bytes = nullptr; // of the first text only
         }
         for (const std::string &in : split(c.refused)) {
             SCOPED_TRACE(std::to_string(c.type) + " " + in);
+            log_lines log;
             attrib_owner attrib;
             binding_owner binding;
-            uint32_t kept = 0, word = 0;
+            uint32_t word = 0;
             ASSERT_EQ(bn_attrib_new_uint32(&attrib, 1, 0, 77), LC_OK);
             EXPECT_EQ(set_text(attrib, c.type, in), LC_BAD_TYPE);
-            EXPECT_EQ(bn_attrib_get_uint32(attrib, nullptr, nullptr, &kept), LC_OK);
-            EXPECT_EQ(kept, 77u);
+            EXPECT_EQ(value_of(attrib), "77"); // as before
             EXPECT_EQ(bn_binding_new_str_autoinval(&binding, "/a", 1, c.type & BN_TYPE_MASK,
                                                    c.type & ~BN_TYPE_MASK, in.c_str()),
                       LC_OK);
@@ -136,7 +150,7 @@ TEST(Texts, BecomeValuesAndTextsAgain) {
         }
     }
 }
-TEST(Texts, RefusedTypesAndIds) {
+TEST(Values, RefusedTypesAndIds) {
     attrib_owner attrib;
     EXPECT_EQ(bn_attrib_new_str(&attrib, 1, bn_type_any, 0, "x"), LC_UNEXPECTED_CASE);
     EXPECT_EQ(attrib.pointer, nullptr);
@@ -151,86 +165,17 @@ TEST(Texts, RefusedTypesAndIds) {
     ASSERT_EQ(bn_binding_new_str_autoinval(&invalid, "/a", 1, bn_type_uint32, 0, "abc"), LC_OK);
     const bn_attrib *given = nullptr;
     ASSERT_EQ(bn_binding_get_attrib(invalid, 1, &given), LC_OK);
-    EXPECT_EQ(given->value_size, 4u);
-    EXPECT_EQ(given->type_flags, static_cast<uint32_t>(bn_flag_invalid));
-    ASSERT_EQ(bn_binding_new_str(&absent, "/a", 1, bn_type_str, bn_flag_deleted | bn_flag_absent, nullptr),
-              LC_OK);
+    EXPECT_TRUE(given->value_size == 4 && given->type_flags == bn_flag_invalid);
+    constexpr uint32_t gone = bn_flag_deleted | bn_flag_absent;
+    ASSERT_EQ(bn_binding_new_str(&absent, "/a", 1, bn_type_str, gone, nullptr), LC_OK);
     uint32_t type = 0, flags = 0;
     EXPECT_EQ(bn_binding_get_type(absent, 1, &type, &flags), LC_OK);
     EXPECT_TRUE(type == bn_type_str && flags == 0x180000u && bn_type_string(type));
     EXPECT_FALSE(bn_type_string(type | flags));
 }
 
-// --- Wire: bytes written by hand
-
-std::string from_hex(const char *hex) {
-    std::string bytes;
-    for (; *hex; hex++)
-        if (*hex != ' ') {
-            bytes += static_cast<char>(std::stoi(std::string(hex, 2), nullptr, 16));
-            hex++;
-        }
-    return bytes;
-}
-std::string content(const tbuffer *buffer) {
-    return std::string(reinterpret_cast<char *>(tb_buf(buffer)), static_cast<size_t>(tb_length(buffer)));
-}
-
-std::string golden_bytes(const type_case &c) {
-    char header[64];
-    snprintf(header, sizeof header, "%08x 00000001 %08x %08x", c.kind, c.type & BN_TYPE_MASK,
-             c.type & ~BN_TYPE_MASK);
-    return from_hex(header) + from_hex(c.bytes);
-}
-
-TEST(Wire, EachFamilyByteForByte) {
-    for (const type_case &c : type_cases) {
-        if (!c.bytes)
-            continue;
-        SCOPED_TRACE(c.type);
-        attrib_owner attrib, back;
-        buffer_owner buffer;
-        const std::string golden = golden_bytes(c);
-        ASSERT_EQ(tb_new(&buffer), LC_OK);
-        ASSERT_EQ(tb_append_uint8(buffer, 0xee), LC_OK); // odd offsets
-        ASSERT_EQ(bn_attrib_new(&attrib), LC_OK);
-        const std::string first = split(c.texts)[0];
-        ASSERT_EQ(set_text(attrib, c.type, first.substr(0, first.find(" -> "))), LC_OK);
-        ASSERT_EQ(bn_attrib_append_wire(attrib, buffer), LC_OK);
-        EXPECT_EQ(content(buffer).substr(1), golden);
-
-        uint32_t used = 0;
-        ASSERT_EQ(bn_attrib_read_wire(buffer, 1, &back, &used), LC_OK);
-        EXPECT_EQ(used, golden.size());
-        EXPECT_EQ(back->value_size, attrib->value_size);
-        int order = 1;
-        ASSERT_EQ(bn_attrib_compare(attrib, back, &order), LC_OK);
-        EXPECT_EQ(order, 0);
-        EXPECT_EQ(back->type | back->type_flags, c.type);
-
-        for (size_t length = 1; length < golden.size(); length++) {
-            // A buffer of exactly these bytes, so that the sanitizer sees a read past them.
-            const std::vector<char> bytes(golden.data(), golden.data() + length);
-            buffer_owner cut;
-            attrib_owner none;
-            ASSERT_EQ(tb_new_buf_const(&cut, bytes.data(), static_cast<uint32_t>(length)), LC_OK);
-            EXPECT_NE(bn_attrib_read_wire(cut, 0, &none, &used), LC_OK) << length;
-            EXPECT_EQ(none.pointer, nullptr);
-        }
-    }
-}
-
-lc_status read_hex(const char *hex, bn_attrib **out) {
-    const std::string bytes = from_hex(hex);
-    buffer_owner buffer;
-    EXPECT_EQ(tb_new_buf(&buffer, bytes.data(), static_cast<int32_t>(bytes.size())), LC_OK);
-    return bn_attrib_read_wire(buffer, 0, out, nullptr);
-}
 TEST(Wire, FalseFieldsAreRefused) {
-    static const struct {
-        const char *bytes;
-        lc_status status;
-    } cases[] = {
+    static const std::pair<const char *, lc_status> cases[] = {
         {"00000001 ffffffff 00000005 00000000 00000004 00000001", LC_ASSERTION}, // ids
         {"00000001 00000000 00000005 00000000 00000004 00000001", LC_ASSERTION},
         {"00000001 00000004 00000005 00000000 00000004 00000001", LC_ASSERTION},
@@ -246,40 +191,31 @@ TEST(Wire, FalseFieldsAreRefused) {
         {"00000001 00000001 00000005 00000000 ffffffff 00000001", LC_GENERIC},
         {"00000004 00000001 00000065 00000000 ffffffff 616263", LC_NO_BUFFER_SPACE}, // lengths
         {"00000004 00000001 00000067 00000000 00000004 616263", LC_NO_BUFFER_SPACE},
+        {"00000004 00000001 00000066 00000000 00000002 61ff", LC_OK}, // bad UTF-8 stays plain text
     };
-    for (const auto &c : cases) {
-        attrib_owner attrib;
-        EXPECT_EQ(read_hex(c.bytes, &attrib), c.status) << c.bytes;
-    }
-    log_lines log;
     attrib_owner attrib;
     buffer_owner buffer;
+    for (const auto &[bytes, status] : cases)
+        EXPECT_EQ(read_bytes(from_hex(bytes), &attrib), status) << bytes;
+    EXPECT_EQ(text(attrib->value.string), "a\xff");
+    EXPECT_EQ(attrib->value.string->utf8, 0);
+    log_lines log;
     ASSERT_TRUE(tb_new(&buffer) == LC_OK && bn_attrib_new(&attrib) == LC_OK);
     attrib->type = bn_type_any;
     EXPECT_EQ(bn_attrib_append_wire(attrib, buffer), LC_NULL);
-    EXPECT_NE(log.take().find("Couldn't get attrib copy out func for type any"), std::string::npos);
+    EXPECT_TRUE(log.say("Couldn't get attrib copy out func for type any"));
     attrib->type = 0;
     EXPECT_EQ(bn_attrib_append_wire(attrib, buffer), LC_ASSERTION);
     EXPECT_EQ(tb_length(buffer), 0);
 }
 
-TEST(Wire, InvalidUtf8StaysPlainText) {
-    attrib_owner attrib;
-    ASSERT_EQ(read_hex("00000004 00000001 00000066 00000000 00000002 61ff", &attrib), LC_OK);
-    EXPECT_EQ(text(attrib->value.string), "a\xff");
-    EXPECT_EQ(attrib->value.string->utf8, 0);
-}
-
 // --- Attributes and bindings
 
 TEST(Attributes, Order) {
-    static const struct {
-        uint32_t type;
-        const char *lower, *higher;
-    } pairs[] = {
+    static const std::tuple<uint32_t, const char *, const char *> pairs[] = {
+        // the lower one first
         {bn_type_int32, "-1", "1"},
         {bn_type_uint32, "1", "4294967295"},
-        {bn_type_uint64, "9", "10"},
         {bn_type_float64, "-1.5", "0.5"},
         {bn_type_str, "10", "9"},
         {bn_type_binary, "ab", "abc"},
@@ -287,70 +223,52 @@ TEST(Attributes, Order) {
         {bn_type_ipv4addr, "9.9.9.9", "10.0.0.2"},
         {bn_type_ipprefix, "10.0.0.0/8", "10.0.0.0/16"},
     };
-    attrib_owner number, invalid;
-    ASSERT_EQ(bn_attrib_new_uint32(&number, 1, 0, 1), LC_OK);
-    ASSERT_EQ(bn_attrib_new_str(&invalid, 1, bn_type_uint8, bn_flag_invalid, ""), LC_OK);
     const auto compare = [](const bn_attrib *a, const bn_attrib *b) {
         int order = 99;
         EXPECT_EQ(bn_attrib_compare(a, b, &order), LC_OK);
         return order;
     };
+    attrib_owner left, right, number;
+    ASSERT_EQ(bn_attrib_new_uint32(&number, 1, 0, 1), LC_OK);
     for (const auto &[type, lower, higher] : pairs) {
-        attrib_owner left, right, copy;
         ASSERT_EQ(bn_attrib_new_str(&left, 1, type, 0, lower), LC_OK);
         ASSERT_EQ(bn_attrib_new_str(&right, 1, type, 0, higher), LC_OK);
-        ASSERT_EQ(bn_attrib_dup(left, &copy), LC_OK);
-        EXPECT_TRUE(compare(left, right) < 0 && compare(right, left) > 0 && compare(left, copy) == 0)
-            << lower;
+        EXPECT_TRUE(compare(left, right) < 0 && compare(right, left) > 0) << type;
         EXPECT_EQ(compare(left, number), type == bn_type_uint32 ? 0 : static_cast<int>(type) - 5);
     }
-    EXPECT_TRUE(compare(number, invalid) < 0 && compare(invalid, invalid) == 0 &&
-                compare(nullptr, number) > 0);
+    EXPECT_GT(compare(nullptr, number), 0);
 }
 
 TEST(Bindings, TypedOperations) {
-    binding_owner binding, address, bare;
+    binding_owner binding, bare;
     uint32_t type = 9, value = 42;
-    int8_t small = 0;
-    uint64_t first = 0, last = 0;
     ASSERT_EQ(bn_binding_new_uint32(&binding, "/a", 1, bn_flag_display | 7, 5), LC_OK);
     EXPECT_EQ(bn_binding_get_uint32(binding, 1, &type, &value), LC_OK);
     EXPECT_TRUE(value == 5 && type == (bn_type_uint32 | bn_flag_display));
     EXPECT_EQ(bn_binding_get_uint32(binding, 0, &type, &value), LC_OK); // an empty slot
     EXPECT_TRUE(value == 5 && type == 0);
-    EXPECT_EQ(bn_binding_set_uint64(binding, 129, 0, 1ull << 40), LC_OK);
     EXPECT_EQ(bn_binding_set_int8(binding, 1, 0, -1), LC_OK);
-    EXPECT_TRUE(bn_binding_get_int8(binding, 1, nullptr, &small) == LC_OK && small == -1);
-    ASSERT_EQ(bn_binding_new_ipv6addr(&address, "/b", 1, 0, 1, 2), LC_OK);
-    EXPECT_EQ(bn_binding_get_ipv6addr(address, 1, nullptr, &first, &last), LC_OK);
-    EXPECT_TRUE(first == 1 && last == 2);
     ASSERT_EQ(bn_binding_new_named(&bare, "/c"), LC_OK);
     log_lines log;
     char *given = nullptr;
+    EXPECT_EQ(bn_binding_get_str(binding, 0, 0, nullptr, &given), LC_OK);
+    EXPECT_TRUE(given == nullptr && log.take().empty());
     const auto expect = [&](lc_status got, lc_status wanted, const char *line) {
         EXPECT_EQ(got, wanted) << line;
-        const std::string lines = log.take();
-        EXPECT_TRUE(*line ? lines.find(line) != std::string::npos : lines.empty()) << line << lines;
+        EXPECT_TRUE(log.say(line)) << line;
     };
     expect(bn_binding_get_uint32(nullptr, 1, nullptr, &value), LC_NULL, "NULL binding passed");
     expect(bn_binding_get_uint32(bare, 1, nullptr, &value), LC_NULL, "Unexpected NULL");
-    expect(bn_binding_get_uint32(binding, 1, nullptr, &value), LC_ASSERTION,
-           "Tried to get a int8 attribute as a uint32");
-    expect(bn_binding_get_uint32(address, 129, nullptr, &value), LC_NOT_FOUND, "Error code 14004");
+    expect(bn_binding_get_uint32(binding, 1, nullptr, &value), LC_ASSERTION, "a int8 attribute as a uint32");
+    expect(bn_binding_get_uint32(binding, 129, nullptr, &value), LC_NOT_FOUND, "Error code 14004");
     expect(bn_binding_get_type(bare, 1, &type, nullptr), LC_NULL, "Unexpected NULL");
     expect(bn_binding_get_str(bare, 1, 0, nullptr, &given), LC_NULL,
            "Can't get attribute value of binding /c");
     expect(bn_binding_get_str(binding, 1, bn_type_str, nullptr, &given), LC_ASSERTION, "Error code");
-    expect(bn_binding_get_str(address, 0, 0, nullptr, &given), LC_OK, "");
-    EXPECT_EQ(given, nullptr);
 }
 
 TEST(Bindings, NamesAndParts) {
-    const struct {
-        const char *name;
-        int absolute;
-        strings parts;
-    } cases[] = {
+    const std::tuple<const char *, int, strings> cases[] = {
         {"a/b", 0, {"a", "b"}},
         {"/a//b", 1, {"a", "", "b"}},
         {"/a/", 1, {"a", ""}},
@@ -359,25 +277,19 @@ TEST(Bindings, NamesAndParts) {
         {"a\\b", 0, {"a\\b"}},
         {"/a\\/b/c", 1, {"a/b", "c"}},
     };
-    for (const auto &c : cases) { // and back, in the test of the matchers
-        parts_owner parts;
+    tokens_owner parts;
+    for (const auto &[name, expected, list] : cases) { // and back, in the test of the matchers
         int absolute = -1;
-        ASSERT_EQ(bn_binding_name_to_parts(c.name, &parts, &absolute), LC_OK);
-        EXPECT_EQ(absolute, c.absolute) << c.name;
-        EXPECT_EQ(list_of(parts), c.parts) << c.name;
+        ASSERT_EQ(bn_binding_name_to_parts(name, &parts, &absolute), LC_OK);
+        EXPECT_TRUE(absolute == expected && list_of(parts) == list) << name;
     }
-    const char *syslog = "/logging/syslog/action/file/\\/var\\/log\\/messages/facility/all/min_priority";
-    binding_owner binding, from_parts, copy;
-    parts_owner parts;
-    ASSERT_EQ(bn_binding_new_named(&binding, syslog), LC_OK);
-    ASSERT_EQ(bn_binding_get_name_parts(binding, &parts), LC_OK);
-    EXPECT_EQ(list_of(parts).at(4), "/var/log/messages");
-    ASSERT_EQ(bn_binding_new_parts_components(&from_parts, nullptr, parts, 1, nullptr), LC_OK);
-    EXPECT_STREQ(bn_binding_get_name_quick(from_parts), syslog);
+    binding_owner binding, copy;
+    ASSERT_EQ(bn_binding_new_named(&binding, "/file/\\/var\\/log/all"), LC_OK);
+    ASSERT_EQ(bn_binding_name_to_parts("/file/\\/var\\/log/all", &binding->parts, nullptr), LC_OK);
     const tstr_array *kept = nullptr;
-    ASSERT_EQ(bn_binding_dup(from_parts, &copy), LC_OK);
+    ASSERT_EQ(bn_binding_dup(binding, &copy), LC_OK);
     ASSERT_EQ(bn_binding_get_name_parts_const(copy, &kept, nullptr), LC_OK);
-    EXPECT_EQ(tstr_array_length_quick(kept), 8u);
+    EXPECT_EQ(list_of(kept), (strings{"file", "/var/log", "all"}));
     ASSERT_EQ(bn_binding_set_name(copy, "relative"), LC_OK);
     ASSERT_EQ(bn_binding_get_name_parts_const(copy, &kept, nullptr), LC_OK);
     EXPECT_EQ(kept, nullptr);
@@ -385,15 +297,13 @@ TEST(Bindings, NamesAndParts) {
 }
 
 TEST(Bindings, Patterns) {
-    static const struct {
-        const char *pattern, *matching, *other; // null: none
-    } cases[] = {
+    static const std::array<const char *, 3> cases[] = {
+        // a pattern, a match, none; null: not given
         {"/config/*", "/config/51", "/config/51/weight"},
         {"/logging/**", "/logging/a", "/logging"},
         {"/logging/**", "/logging/a/b/c", nullptr},
         {"/a/**/b", "/a/x/y", "/a/x"},
         {"/a/b", "/a/b", "a/b"},
-        {"/a/b", nullptr, "/a/bc"},
         {"a/b", "a/b", "/a/b"},
         {"/a/bc", nullptr, "/a/b"},
         {"/a/*/c", "/a/x\\/y/c", nullptr},
@@ -401,8 +311,8 @@ TEST(Bindings, Patterns) {
         {"/a/*", "/a/", nullptr},
         {"/", "/", "/a"},
         {"/*", nullptr, "/"},
-        {"/a//b", "/a//b", nullptr},
-        {"/a\\b", "/a\\b", nullptr},
+        {"/a//b", "/a//b", "/a/bc"},
+        {"/a\\b", "/a\\b", "/a/b"},
     };
     for (const auto &[pattern, matching, other] : cases) {
         EXPECT_TRUE(!matching || bn_binding_name_pattern_match(matching, pattern)) << pattern;
@@ -414,32 +324,27 @@ TEST(Bindings, Patterns) {
 // with the same bytes from its text and from its parts, and a received one is the same text again.
 TEST(Bindings, BothMatchersAgreeEverywhere) {
     static const char *pieces[] = {"a", "*", "**", "\\/", "\\\\", "", "ab"};
-    std::vector<std::string> names = {"", "/"};
-    for (const char *lead : {"", "/"})
+    strings names = {"", "/"};
+    for (const std::string lead : {"", "/"})
         for (const char *one : pieces)
-            for (const char *two : pieces) {
-                names.push_back(std::string(lead) + one + "/" + two);
-                names.push_back(std::string(lead) + one + two);
-                names.push_back(std::string(lead) + one + "/" + two + "/a");
-            }
+            for (const std::string two : pieces)
+                for (const std::string &rest : {"/" + two, two, "/" + two + "/a"})
+                    names.push_back(lead + one + rest);
     for (const std::string &name : names) {
-        parts_owner parts;
+        tokens_owner parts;
         int absolute = 0;
         ASSERT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, &absolute), LC_OK);
         std::string bytes[2];
         for (const bool from_parts : {false, true}) {
-            owner<bn_request_msg, bn_request_msg_free> msg;
+            request_owner msg, read;
             binding_owner binding;
             buffer_owner buffer;
             ASSERT_EQ(bn_event_request_msg_create(&msg, "e"), LC_OK);
             ASSERT_EQ(bn_binding_new_named(&binding, name.c_str()), LC_OK);
-            if (from_parts) {
-                ASSERT_EQ(tstr_array_duplicate(parts, &binding->parts), LC_OK);
-            }
+            ASSERT_EQ(from_parts ? tstr_array_duplicate(parts, &binding->parts) : LC_OK, LC_OK);
             ASSERT_EQ(bn_event_request_msg_append_binding_takeover(msg, 0, &binding.pointer, nullptr), LC_OK);
             ASSERT_EQ(bn_request_msg_serialize(msg, 0, &buffer), LC_OK);
-            bytes[from_parts] = content(buffer);
-            owner<bn_request_msg, bn_request_msg_free> read;
+            bytes[from_parts] = bytes_of(buffer);
             ASSERT_EQ(bn_request_msg_deserialize(buffer, 0, &read), LC_OK);
             EXPECT_EQ(
                 text_of([&](char **out) { return bn_binding_name_parts_to_name(parts, absolute, out); }),
@@ -455,48 +360,39 @@ TEST(Bindings, BothMatchersAgreeEverywhere) {
 
 // --- Arrays
 
-void append(bn_binding_array *array, const std::string &name, uint32_t value) {
-    binding_owner binding;
-    ASSERT_EQ(bn_binding_new_uint32(&binding, name.c_str(), 1, 0, value), LC_OK);
-    ASSERT_EQ(bn_binding_array_append_takeover(array, &binding.pointer), LC_OK);
-    ASSERT_EQ(binding.pointer, nullptr);
+void append(bn_binding_array *array, const strings &names) {
+    for (const std::string &name : names) {
+        binding_owner binding;
+        EXPECT_EQ(bn_binding_new_uint32(&binding, name.c_str(), 1, 0, 7), LC_OK);
+        EXPECT_EQ(bn_binding_array_append_takeover(array, &binding.pointer), LC_OK);
+        EXPECT_EQ(binding.pointer, nullptr);
+    }
 }
 TEST(BindingArrays, FindByNameAndPattern) {
     for (const bool sorted : {false, true}) {
         bindings_owner array;
         ASSERT_EQ(bn_binding_array_new(&array), LC_OK);
-        for (const char *name :
-             {"/c/2/router/1", "/c/1", "/c/1/router/3", "/c/1/router/1", "/c-x", "/c/1/router"})
-            append(array, name, 7);
-        if (sorted) {
-            ASSERT_EQ(bn_binding_array_sort(array), LC_OK);
-        }
+        append(array, {"/c/2/router/1", "/c/1", "/c/1/router/3", "/c/1/router/1", "/c-x", "/c/1/router"});
+        ASSERT_EQ(sorted ? bn_binding_array_sort(array) : LC_OK, LC_OK);
         const bn_binding *found = nullptr;
         string_owner value, name;
         uint32_t type = 0;
         int32_t index = 0;
-        parts_owner parts;
+        tokens_owner parts;
         binding_owner detached;
         EXPECT_EQ(bn_binding_array_get_binding_by_name_rel(array, "/c/1", "router/1", &found), LC_OK);
-        ASSERT_NE(found, nullptr);
         EXPECT_STREQ(bn_binding_get_name_quick(found), "/c/1/router/1");
-        EXPECT_EQ(bn_binding_array_get_value_tstr_by_name(array, "/c/1", &type, &value), LC_OK);
+        EXPECT_EQ(bn_binding_array_get_value_tstr_by_name_rel(array, "/c", "1", &type, &value), LC_OK);
         EXPECT_TRUE(text(value) == "7" && type == bn_type_uint32);
         EXPECT_EQ(bn_binding_array_get_value_tstr_by_name_rel(array, "/c", "9", &type, &value), LC_OK);
         EXPECT_EQ(value.pointer, nullptr);
-
-        EXPECT_EQ(bn_binding_array_get_name_part_tstr_array(array, "/c/*/router/*", 1, &parts), LC_OK);
+        const char *pattern = "/c/*/router/*";
+        EXPECT_EQ(bn_binding_array_get_name_part_tstr_array(array, pattern, 1, &parts), LC_OK);
         EXPECT_EQ(list_of(parts), sorted ? strings({"1", "1", "2"}) : strings({"2", "1", "1"}));
         EXPECT_NE(bn_binding_array_get_name_part_tstr_array(array, "/c/1", 2, &parts), LC_OK);
-        EXPECT_EQ(
-            bn_binding_array_get_first_matching_value_tstr(array, "/c/*/router/*", 0, &index, &name, &value),
-            LC_OK);
-        EXPECT_EQ(text(name), sorted ? "/c/1/router/1" : "/c/2/router/1");
-        const auto next = static_cast<uint32_t>(index) + 1;
-        EXPECT_EQ(bn_binding_array_get_first_matching_binding(array, "/c/*/router/*", next, &index, &found),
+        EXPECT_EQ(bn_binding_array_get_first_matching_value_tstr(array, pattern, 2, &index, &name, &value),
                   LC_OK);
-        EXPECT_STREQ(bn_binding_get_name_quick(found), "/c/1/router/3");
-
+        EXPECT_EQ(text(name), sorted ? "/c/1/router/1" : "/c/1/router/3");
         EXPECT_EQ(bn_binding_array_detach_binding_by_name(array, "/c-x", &detached), LC_OK);
         EXPECT_STREQ(bn_binding_get_name_quick(detached), "/c-x");
         EXPECT_EQ(bn_binding_array_length_quick(array), 5u);
@@ -509,19 +405,19 @@ TEST(BindingArrays, RenamedBindingsAreFound) {
     bindings_owner array;
     ASSERT_EQ(bn_binding_array_new(&array), LC_OK);
     for (int i = 40; i > 0; i--)
-        append(array, "/n/" + std::to_string(i), 0);
-    int32_t index = -1;
-    ASSERT_EQ(bn_binding_array_get_index_by_name(array, "/n/5", &index), LC_OK);
-    EXPECT_EQ(index, 35);
+        append(array, {"/n/" + std::to_string(i)});
+    const auto expect_index = [&](const char *name, int32_t expected) {
+        int32_t index = -2;
+        EXPECT_EQ(bn_binding_array_get_index_by_name(array, name, &index), LC_OK);
+        EXPECT_EQ(index, expected) << name;
+    };
+    expect_index("/n/5", 35);
     EXPECT_NE(array->list->index, nullptr); // the search uses the index
     ASSERT_EQ(bn_binding_set_name(bn_binding_array_get_quick(array, 35), "/m"), LC_OK);
-    ASSERT_EQ(bn_binding_array_get_index_by_name(array, "/n/5", &index), LC_OK);
-    EXPECT_EQ(index, -1);
-    ASSERT_EQ(bn_binding_array_get_index_by_name(array, "/m", &index), LC_OK);
-    EXPECT_EQ(index, 35);
-    append(array, "/a", 0);
-    ASSERT_EQ(bn_binding_array_get_index_by_name(array, "/a", &index), LC_OK);
-    EXPECT_EQ(index, 40);
+    expect_index("/n/5", -1);
+    expect_index("/m", 35);
+    append(array, {"/a"});
+    expect_index("/a", 40);
 }
 
 } // namespace

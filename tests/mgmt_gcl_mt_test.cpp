@@ -1,15 +1,10 @@
 // A session on which other threads send while its own thread runs its loop, as for alarms and state events.
 // With WCCP_STRESS=1 it runs longer: a minute of sending, a thousand closings.
 #include <atomic>
-#include <cstdlib>
-#include <map>
 #include <random>
 #include <thread>
 
-#include <gtest/gtest.h>
-#include <poll.h>
 #include <pthread.h>
-#include <sys/ioctl.h>
 
 #include "runtime/ttime.h"
 #include "tests/support/gcl_client.h"
@@ -29,7 +24,7 @@ bool stress() {
 // Like the alarm client: a thread that makes the session, opens it and runs its loop.
 struct session_thread {
     gcl_client client;
-    std::atomic<int> ready{0}, ended{0}, acknowledged{0};
+    std::atomic<uint32_t> ready{0}, ended{0}, acknowledged{0};
     std::thread thread;
     std::thread::id closed_on;
 
@@ -60,27 +55,24 @@ struct session_thread {
 
 // Like an engine thread: it holds a lock while it sends, and is cancelled at any moment and started again.
 struct sender {
-    session_thread *to = nullptr;
-    pthread_mutex_t *engine = nullptr;
-    uint16_t number = 0;
+    session_thread *to;
+    uint16_t number;
     pthread_t thread{};
     std::atomic<uint32_t> next{0};
-    std::atomic<uint32_t> refused{0};
     std::atomic<bool> stop{false};
 
+    sender(session_thread *session, uint16_t own_number) : to(session), number(own_number) { start(); }
     static void *run(void *data) {
+        static pthread_mutex_t engine = PTHREAD_MUTEX_INITIALIZER;
         auto *self = static_cast<sender *>(data);
         std::minstd_rand random(self->number);
         while (!self->stop) {
             {
-                const mutex_guard guard(self->engine);
+                const mutex_guard guard(&engine);
                 const wire body =
                     be(self->next, 4) + wire(random() % 4000, static_cast<char>('a' + self->number));
-                const lc_status status = self->to->client.send(self->number, body);
-                if (status == LC_OK)
+                if (self->to->client.send(self->number, body) == LC_OK)
                     self->next++;
-                else
-                    self->refused++;
             }
             if (random() % 16 == 0)
                 usleep(50);
@@ -99,15 +91,10 @@ struct sender {
     }
 };
 
-template <size_t Count>
-void start_all(sender (&senders)[Count], session_thread *session) {
-    static pthread_mutex_t engine = PTHREAD_MUTEX_INITIALIZER;
-    for (uint16_t i = 0; i < Count; i++) {
-        senders[i].to = session;
-        senders[i].engine = &engine;
-        senders[i].number = static_cast<uint16_t>(i + 1);
-        senders[i].start();
-    }
+void wait_until(const std::function<bool()> &done) {
+    for (const int64_t start = lt_monotonic_ms(); !done() && lt_monotonic_ms() - start < 10000;)
+        usleep(500);
+    ASSERT_TRUE(done());
 }
 
 // All frames of all senders arrive complete, once and in order, at whatever pace the provider reads.
@@ -116,8 +103,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
     ASSERT_TRUE(provider.listen_as("mgmtd"));
     session_thread session;
     session.start(&provider);
-    sender senders[3];
-    start_all(senders, &session);
+    sender senders[] = {{&session, 1}, {&session, 2}, {&session, 3}};
     std::atomic<bool> over{false};
     // Cancelled at random moments: the frame that it was sending is still sent completely and counted.
     std::thread canceller([&] {
@@ -151,31 +137,25 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
         const uint32_t who = number_at(frame, 26, 2);
         ASSERT_EQ(number_at(frame, 20), sequence++);
         ASSERT_TRUE(who >= 1 && who <= 3);
-        const uint32_t number = number_at(frame, 32);
-        ASSERT_EQ(number, expected[who]++) << who;
+        ASSERT_EQ(number_at(frame, 32), expected[who]++) << who;
         ASSERT_EQ(frame.find_first_not_of(static_cast<char>('a' + who), 36), wire::npos);
         frames++;
         if (random() % 200 == 0) { // a burst of acknowledgements
-            const auto burst = static_cast<uint32_t>(random() % 100);
-            wire bytes;
-            for (uint32_t i = 0; i < burst; i++)
+            wire bytes = frame_bytes(3, 1, "k");
+            for (size_t i = random() % 100; i > 0; i--, acknowledged++)
                 bytes += frame_bytes(3, 1, wire(i, 'k'));
+            acknowledged++;
             ASSERT_TRUE(provider.put(bytes));
-            acknowledged += burst;
         }
     }
     for (uint16_t i = 1; i <= 3; i++)
         EXPECT_EQ(senders[i - 1].next, expected[i]);
     EXPECT_GT(frames, 100u);
-    for (const int64_t start = lt_monotonic_ms();
-         session.acknowledged < static_cast<int>(acknowledged) && lt_monotonic_ms() - start < 5000;)
-        usleep(1000);
-    EXPECT_EQ(session.acknowledged, static_cast<int>(acknowledged));
+    wait_until([&] { return session.acknowledged == acknowledged; });
     EXPECT_FALSE(session.ended);
     EXPECT_EQ(lew_escape_from_dispatch(session.client.wrapper), LC_OK);
     session.thread.join();
     session.client.finish();
-    printf("%u frames, %u acknowledgements\n", frames, acknowledged);
 }
 
 // The provider closes at random moments, while the loop's thread reads and others send. Whichever thread
@@ -188,17 +168,14 @@ TEST(GclThreads, AProviderThatClosesWhileOthersSend) {
     for (int i = 0; i < rounds; i++) {
         session_thread session;
         session.start(&provider);
-        sender senders[2];
-        start_all(senders, &session);
+        sender senders[] = {{&session, 1}, {&session, 2}};
         if (i % 2)
             (void)provider.put(frame_bytes(3, 1, wire(static_cast<size_t>(random() % 3000), 'p')));
         if (i % 3)
             provider.take_frame();
         usleep(static_cast<useconds_t>(random() % 4000));
         provider.close_client();
-        for (const int64_t start = lt_monotonic_ms(); !session.ended && lt_monotonic_ms() - start < 10000;)
-            usleep(500);
-        ASSERT_TRUE(session.ended);
+        wait_until([&] { return session.ended == 1; });
         const std::thread::id own = session.thread.get_id();
         session.thread.join();
         for (sender &each : senders)

@@ -2,57 +2,41 @@
 #include <gtest/gtest.h>
 #include <malloc.h>
 
-#include <string>
+#include <functional>
 
-#include "mgmt/bnode_proto.h"
 #include "tests/support/gcl_log.h"
 #include "tests/support/hand_session.h"
-#include "tests/support/owners.h"
+#include "tests/support/mgmt_owners.h"
 
 namespace {
 
-using request_owner = owner<bn_request_msg, bn_request_msg_free>;
-using response_owner = owner<bn_response_msg, bn_response_msg_free>;
-using binding_owner = owner<bn_binding, bn_binding_free>;
-using bindings_owner = owner<bn_binding_array, bn_binding_array_free>;
 using ids_owner = owner<uint32_array, uint32_array_free>;
-using string_owner = owner<tstring, ts_free>;
-using buffer_owner = owner<tbuffer, tb_free>;
 
-wire u8(uint32_t value) {
-    return be(value, 1);
+// Part of a message: a number in as many bytes as its type has, a text with its length, or bytes as they are.
+struct part {
+    wire bytes;
+    template <typename Number, typename = std::enable_if_t<!std::is_convertible_v<Number, wire>>>
+    part(Number number) : bytes(be(static_cast<uint64_t>(number), sizeof number)) {}
+    part(const char *text) : bytes(be(strlen(text), 4) + text) {}
+    part(const wire &raw) : bytes(raw) {}
+};
+template <typename... Parts>
+wire pack(const Parts &...parts) {
+    return (part(parts).bytes + ...);
 }
-wire u16(uint32_t value) {
-    return be(value, 2);
-}
-wire u32(uint32_t value) {
-    return be(value, 4);
-}
-wire str(const wire &text) {
-    return u32(static_cast<uint32_t>(text.size())) + text;
-}
+constexpr uint8_t relative = 0, absolute = 1;
 // Kind, id, type and flags, and the value with its length.
 wire text_attribute(uint32_t id, uint32_t type, const wire &text) {
-    return u32(4) + u32(id) + u32(type) + u32(0) + str(text);
+    return pack(4, id, type, 0, static_cast<uint32_t>(text.size()), text);
 }
 const wire room(32, '\0');
-wire request(uint32_t type, const wire &rest) {
-    return u16(2) + u16(type) + u32(static_cast<uint32_t>(48 + rest.size())) + u32(7) + u32(8) + rest;
+wire request(uint16_t type, const wire &rest) {
+    return pack(uint16_t{2}, type, static_cast<uint32_t>(48 + rest.size()), 7, 8, rest);
 }
-wire response(uint32_t type, const wire &rest) {
-    return u16(2) + u16(type) + u32(static_cast<uint32_t>(52 + rest.size())) + u32(7) + u32(8) + u32(41) +
-           rest;
-}
-template <typename Message>
-void number(Message *msg) {
-    msg->service_id = 2;
-    msg->msg_id = 7;
-    msg->transaction_id = 8;
+wire response(uint16_t type, const wire &rest) {
+    return pack(uint16_t{2}, type, static_cast<uint32_t>(52 + rest.size()), 7, 8, 41, rest);
 }
 
-wire bytes_of(const tbuffer *buffer) {
-    return {reinterpret_cast<const char *>(tb_buf(buffer)), static_cast<size_t>(tb_length(buffer))};
-}
 template <typename Message>
 lc_status read(lc_status (*from)(const tbuffer *, uint32_t, Message **), const wire &bytes, Message **out) {
     buffer_owner buffer;
@@ -60,73 +44,70 @@ lc_status read(lc_status (*from)(const tbuffer *, uint32_t, Message **), const w
     return from(buffer, 32, out);
 }
 lc_status read_request(const wire &bytes, bn_request_msg **out) {
-    return read(bn_request_msg_deserialize, bytes, out);
+    return read(bn_request_msg_deserialize, room + bytes, out);
+}
+lc_status read_response(const wire &bytes, bn_response_msg **out) {
+    return read(bn_response_msg_deserialize, room + bytes, out);
 }
 
 // The message is written as these bytes, also after reading them; anything shorter is refused.
 template <typename Owner, typename Message>
 void expect_bytes(Message *msg, const wire &golden, lc_status (*to)(Message *, uint32_t, tbuffer **),
-                  lc_status (*from)(const tbuffer *, uint32_t, Message **)) {
+                  lc_status (*from)(const wire &, Message **)) {
     buffer_owner written, again;
+    msg->service_id = 2;
+    msg->msg_id = 7;
+    msg->transaction_id = 8;
     ASSERT_EQ(to(msg, 32, &written), 0);
     ASSERT_EQ(bytes_of(written), room + golden);
     EXPECT_EQ(msg->length, 32 + golden.size());
     Owner copy;
-    ASSERT_EQ(read(from, room + golden, &copy), 0);
+    ASSERT_EQ(from(golden, &copy), 0);
     ASSERT_EQ(to(copy, 32, &again), 0);
     EXPECT_EQ(bytes_of(again), room + golden);
     for (size_t length = 0; length < golden.size(); length++) {
         Owner cut;
-        const lc_status status = read(from, room + golden.substr(0, length), &cut);
+        const lc_status status = from(golden.substr(0, length), &cut);
         EXPECT_TRUE(status == LC_ASSERTION || status == LC_NO_BUFFER_SPACE) << length << ": " << status;
         EXPECT_EQ(cut.pointer, nullptr);
     }
 }
-void expect_request(bn_request_msg *msg, uint32_t type, const wire &rest) {
-    number(msg);
-    expect_bytes<request_owner>(msg, request(type, rest), bn_request_msg_serialize,
-                                bn_request_msg_deserialize);
+void expect_request(bn_request_msg *msg, uint16_t type, const wire &rest) {
+    expect_bytes<request_owner>(msg, request(type, rest), bn_request_msg_serialize, read_request);
 }
-void expect_response(bn_response_msg *msg, uint32_t type, const wire &rest) {
-    number(msg);
-    expect_bytes<response_owner>(msg, response(type, rest), bn_response_msg_serialize,
-                                 bn_response_msg_deserialize);
+void expect_response(bn_response_msg *msg, uint16_t type, const wire &rest) {
+    expect_bytes<response_owner>(msg, response(type, rest), bn_response_msg_serialize, read_response);
 }
 
 TEST(messages, request_bytes) {
     request_owner query, set, action, event;
-    uint32_t id = 0;
+    uint32_t id = 0, next = 0;
     ASSERT_EQ(bn_query_request_msg_create(&query, 0, nullptr), 0);
     ASSERT_EQ(bn_query_request_msg_append_str(query, bn_query_get, 0, "/a/b", &id), 0);
-    EXPECT_EQ(id, 1000u);
-    ASSERT_EQ(bn_query_request_msg_append_str(query, bn_query_iterate, 0x3000, "/x\\/y", &id), 0);
-    EXPECT_EQ(id, 1001u);
-    expect_request(query, 1,
-                   str("") + u32(2) + u32(1000) + u8(1) + u32(2) + str("a") + str("b") + u32(0) + u32(1) +
-                       u32(0) + u32(1001) + u8(1) + u32(1) + str("x/y") + u32(0) + u32(2) + u32(0x3000) +
-                       u32(0) + str("") + u32(0));
+    ASSERT_EQ(bn_query_request_msg_append_str(query, bn_query_iterate, 0x3000, "/x\\/y", &next), 0);
+    EXPECT_TRUE(id == 1000 && next == 1001);
+    expect_request(
+        query, 1,
+        pack("", 2, 1000, absolute, 2, "a", "b", 0, 1, 0, 1001, absolute, 1, "x/y", 0, 2, 0x3000, 0, "", 0));
 
     binding_owner binding;
     ASSERT_EQ(bn_set_request_msg_create(&set, 5), 0);
     ASSERT_EQ(bn_binding_new_str(&binding, "/n", bn_attrib_value, bn_type_str, 0, "v"), 0);
     ASSERT_EQ(bn_binding_set_str(binding, bn_attrib_revision_id, bn_type_str, 0, "r"), 0);
-    ASSERT_EQ(bn_set_request_msg_append_binding_takeover(set, bn_set_reparent, 9, &binding.pointer, nullptr),
-              0);
+    ASSERT_EQ(bn_set_request_msg_append_binding_takeover(set, bn_set_reparent, 9, &binding.pointer, &id), 0);
     EXPECT_EQ(binding.pointer, nullptr);
     expect_request(set, 3,
-                   str("") + u32(1) + u32(1000) + u8(1) + u32(1) + str("n") + u32(2) +
-                       text_attribute(1, bn_type_str, "v") + text_attribute(129, bn_type_str, "r") + u32(5) +
-                       u32(9) + str("") + str("") + u32(5) + str("") + u32(0));
+                   pack("", 1, 1000, absolute, 1, "n", 2, text_attribute(1, bn_type_str, "v"),
+                        text_attribute(129, bn_type_str, "r"), 5, 9, "", "", 5, "", 0));
 
     ASSERT_EQ(bn_action_request_msg_create(&action, "/do"), 0);
-    ASSERT_EQ(bn_action_request_msg_append_new_binding(action, 0, "event_name", bn_type_name, "/e", nullptr),
-              0);
-    expect_request(action, 5,
-                   str("") + u32(1) + u32(1000) + u8(0) + u32(1) + str("event_name") + u32(1) +
-                       text_attribute(1, bn_type_name, "/e") + str("/do"));
+    ASSERT_EQ(bn_action_request_msg_append_new_binding(action, 0, "event_name", bn_type_name, "/e", &id), 0);
+    expect_request(
+        action, 5,
+        pack("", 1, 1000, relative, 1, "event_name", 1, text_attribute(1, bn_type_name, "/e"), "/do"));
 
     ASSERT_EQ(bn_event_request_msg_create(&event, "/happened"), 0);
-    expect_request(event, 7, str("") + u32(0) + str("/happened"));
+    expect_request(event, 7, pack("", 0, "/happened"));
     string_owner name;
     EXPECT_EQ(bn_action_request_msg_get_action_name(event, &name), LC_ASSERTION);
     ASSERT_EQ(bn_event_request_msg_get_event_name(event, &name), 0);
@@ -137,18 +118,17 @@ TEST(messages, request_bytes) {
 // A query asks for attributes by id; a registration contains them.
 TEST(messages, attributes_asked_for) {
     binding_owner mask;
+    uint32_t id = 0;
     ASSERT_EQ(bn_binding_new_uint32(&mask, "/m", bn_attrib_capability_mask, 0, 6), 0);
-    for (const uint32_t subop : {bn_query_get, bn_query_registration_info}) {
+    const std::pair<uint32_t, wire> cases[] = {
+        {bn_query_get, pack(bn_type_none, 0, 0)},
+        {bn_query_registration_info, pack(bn_type_uint32, 0, 4, 6)},
+    };
+    for (const auto &[subop, sent] : cases) {
         request_owner msg;
         ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), 0);
-        ASSERT_EQ(bn_query_request_msg_append_with_attribs(msg, subop, 0, "/a", mask->attributes, nullptr),
-                  0);
-        const bool given = subop == bn_query_registration_info;
-        expect_request(msg, 1,
-                       str("") + u32(1) + u32(1000) + u8(1) + u32(1) + str("a") + u32(1) + u32(1) + u32(69) +
-                           (given ? u32(bn_type_uint32) + u32(0) + u32(4) + u32(6)
-                                  : u32(bn_type_none) + u32(0) + u32(0)) +
-                           u32(subop) + u32(0) + u32(0) + str("") + u32(0));
+        ASSERT_EQ(bn_query_request_msg_append_with_attribs(msg, subop, 0, "/a", mask->attributes, &id), 0);
+        expect_request(msg, 1, pack("", 1, 1000, absolute, 1, "a", 1, 1, 69, sent, subop, 0, 0, "", 0));
     }
 }
 
@@ -161,18 +141,15 @@ TEST(messages, response_bytes_and_reading) {
     ASSERT_EQ(bn_binding_new_str(&binding, "/n", bn_attrib_value, bn_type_str, 0, "v"), 0);
     ASSERT_EQ(bn_binding_name_to_parts("/n", &binding.pointer->parts, nullptr), 0);
     ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg, &binding.pointer, 1004), 0);
-    const wire bytes = u32(3) + str("no") + u32(1) + u32(1004) + u8(1) + u32(1) + str("n") + u32(1) +
-                       text_attribute(1, bn_type_str, "v") + u32(99);
+    const wire bytes = pack(3, "no", 1, 1004, absolute, 1, "n", 1, text_attribute(1, bn_type_str, "v"), 99);
     expect_response(msg, 2, bytes);
     ASSERT_EQ(bn_response_msg_dup(msg, &copy), 0);
     for (const bool received : {false, true})
         for (const int keep : {0, 1}) {
             response_owner from;
-            ASSERT_EQ(bn_response_msg_dup(msg, &from), 0);
-            if (received) {
-                ASSERT_EQ(read(bn_response_msg_deserialize, room + response(2, bytes), &from), 0);
-            }
-            for (int round = 0; round < 3; round++) { // by copy, by takeover, and from what is left
+            ASSERT_EQ((received ? read_response(response(2, bytes), &from) : bn_response_msg_dup(msg, &from)),
+                      0);
+            for (const uint32_t round : {0, 1, 2}) { // by copy, by takeover, and from what is left
                 uint32_t code = 0;
                 string_owner message;
                 bindings_owner bindings;
@@ -180,8 +157,7 @@ TEST(messages, response_bytes_and_reading) {
                 ASSERT_EQ(round == 0 ? bn_response_get(from, &code, &message, keep, &bindings, &ids)
                                      : bn_response_get_takeover(from, &code, &message, keep, &bindings, &ids),
                           0);
-                EXPECT_EQ(code, 3u);
-                EXPECT_STREQ(ts_str(message), "no");
+                EXPECT_TRUE(code == 3 && ts_equal_str(message, "no", 0));
                 ASSERT_EQ(bn_binding_array_length_quick(bindings), round < 2 ? 1u : 0u);
                 if (round == 2)
                     continue;
@@ -198,7 +174,7 @@ TEST(messages, response_bytes_and_reading) {
         response_owner other;
         uint32_t revision = 0;
         ASSERT_EQ(bn_response_msg_create(&other, type, 41, 0, nullptr), 0);
-        expect_response(other, type, u32(0) + str("") + u32(0) + (type == 4 ? u32(0) : wire()));
+        expect_response(other, type, pack(0, "", 0, type == 4 ? pack(0) : wire()));
         EXPECT_EQ(bn_query_response_msg_append_binding_takeover(other, &binding.pointer, 0), LC_ASSERTION);
         EXPECT_EQ(bn_query_response_msg_get_db_revision_id(other, &revision), LC_ASSERTION);
     }
@@ -206,58 +182,43 @@ TEST(messages, response_bytes_and_reading) {
 
 // Lengths without the bytes, and malformed values.
 TEST(messages, false_fields_are_refused) {
-    const wire start = room + request(7, str("")), node = u32(1) + u32(1000) + u8(1);
-    const wire named = start + node + u32(1) + str("n"), huge = u32(UINT32_MAX);
-    const wire bodies[] = {
-        start + huge,
-        start + node + huge,
-        named + huge,
-        room + request(7, "") + huge,
-        named + u32(1) + u32(4) + huge + u32(bn_type_str) + u32(0) + str("v"),
-        named + u32(1) + u32(4) + u32(1) + u32(bn_type_str) + u32(0) + huge + "v",
-    };
-    for (const wire &body : bodies) {
+    const wire start = request(7, pack("")), node = pack(start, 1, 1000, absolute),
+               named = pack(node, 1, "n");
+    for (const wire &body :
+         {start, node, named, request(7, ""), pack(named, 1, 4), pack(named, 1, 4, 1, bn_type_str, 0)}) {
         request_owner msg;
-        EXPECT_NE(read_request(body + wire(8, '\0'), &msg), 0);
+        EXPECT_NE(read_request(pack(body, UINT32_MAX, bn_type_str, 0, "v", wire(8, '\0')), &msg), 0);
         EXPECT_EQ(msg.pointer, nullptr);
     }
 }
 
 // In each text of a message; binary values may contain any bytes.
 TEST(messages, a_nul_in_a_text_is_refused) {
-    const wire start = u32(1) + u32(1000) + u8(1), bare = u32(0) + u32(0),
-               trailer = u32(0) + str("") + u32(0);
     gcl_log log;
-    for (const wire &text : {wire("a?b"), wire("a\0b", 3)}) {
-        const wire value = start + u32(1) + str("n") + u32(1);
-        const wire requests[] = {
-            request(7, str(text) + u32(0) + str("e")),
-            request(7, str("") + u32(0) + str(text)),
-            request(7, str("") + start + u32(2) + str(text) + str("c") + u32(0) + str("e")),
-            request(7, str("") + value + text_attribute(1, bn_type_str, text) + str("e")),
-            request(7, str("") + value + text_attribute(1, bn_type_uri, text) + str("e")),
-            request(3,
-                    str("") + start + bare + u32(bn_set_reparent) + u32(0) + str(text) + str("") + trailer),
-            request(3,
-                    str("") + start + bare + u32(bn_set_reparent) + u32(0) + str("") + str(text) + trailer),
-        };
-        const bool refused = text[1] == 0;
-        for (const wire &bytes : requests) {
+    for (const wire &bytes : {wire("a?b"), wire("a\0b", 3)}) {
+        const wire text = pack(3, bytes), start = pack("", 1, 1000, absolute), value = pack(start, 1, "n", 1),
+                   moved = pack(start, 0, 0, bn_set_reparent, 0), options = pack(0, "", 0);
+        const lc_status expected = bytes[1] ? LC_OK : LC_ASSERTION;
+        for (const wire &each : {
+                 request(7, pack(text, 0, "e")),
+                 request(7, pack("", 0, text)),
+                 request(7, pack(start, 2, text, "c", 0, "e")),
+                 request(7, pack(value, text_attribute(1, bn_type_str, bytes), "e")),
+                 request(7, pack(value, text_attribute(1, bn_type_uri, bytes), "e")),
+                 request(3, pack(moved, text, "", options)),
+                 request(3, pack(moved, "", text, options)),
+             }) {
             request_owner msg;
-            EXPECT_EQ(read_request(room + bytes, &msg), refused ? LC_ASSERTION : LC_OK)
-                << (&bytes - requests);
+            EXPECT_EQ(read_request(each, &msg), expected) << testing::PrintToString(each);
         }
         request_owner binary;
         response_owner answer;
-        ASSERT_EQ(read_request(
-                      room + request(7, str("") + value + text_attribute(1, bn_type_binary, text) + str("e")),
-                      &binary),
-                  0);
+        const wire bare = text_attribute(1, bn_type_binary, bytes);
+        ASSERT_EQ(read_request(request(7, pack(value, bare, "e")), &binary), 0);
         const bn_request_node *node = bn_request_per_node_array_get_quick(binary->nodes, 0);
-        EXPECT_EQ(bytes_of(bn_attrib_array_get_quick(node->binding->attributes, 1)->value.binary), text);
-        EXPECT_EQ(read(bn_response_msg_deserialize, room + response(6, u32(0) + str(text) + u32(0)), &answer),
-                  refused ? LC_ASSERTION : LC_OK);
-        EXPECT_EQ(log.count("Received string of 3 bytes contains a NUL at offset 1"), refused ? 8 : 0);
+        EXPECT_EQ(bytes_of(bn_attrib_array_get_quick(node->binding->attributes, 1)->value.binary), bytes);
+        EXPECT_EQ(read_response(response(6, pack(0, text, 0)), &answer), expected);
+        EXPECT_EQ(log.count("Received string of 3 bytes contains a NUL at offset 1"), bytes[1] ? 0 : 8);
     }
 }
 
@@ -270,8 +231,7 @@ size_t allocated() {
 // A received message, and each copy of its bindings, takes at most eight times its bytes, whatever it
 // contains; the parts of the names, if they are wanted, at most nine.
 TEST(messages, received_messages_are_bounded) {
-    const wire name = u8(1) + u32(1) + str("n"),
-               none = u32(1) + u32(130) + u32(bn_type_none) + u32(0) + u32(0);
+    const wire name = pack(absolute, 1, "n"), none = pack(1, 130, bn_type_none, 0, 0);
     const auto times = [](size_t count, const wire &piece) {
         wire all;
         while (count--)
@@ -283,31 +243,24 @@ TEST(messages, received_messages_are_bounded) {
         uint32_t nodes;
         wire node; // from its name on
     } shapes[] = {
-        {"nothing", 4000, u8(0) + u32(0) + u32(0)},
-        {"no parts, absolute", 4000, u8(1) + u32(0) + u32(0)},
-        {"name of one character", 4000, name + u32(0)},
-        {"a part of one slash", 4000, u8(0) + u32(1) + str("/") + u32(0)},
-        {"two empty parts", 4000, u8(0) + u32(2) + str("") + str("") + u32(0)},
-        {"three empty parts", 4000, u8(0) + u32(3) + str("") + str("") + str("") + u32(0)},
-        {"last attribute, no value", 2000, u8(0) + u32(0) + u32(1) + none},
-        {"empty text", 2000, name + u32(1) + text_attribute(1, bn_type_str, "")},
-        {"empty bytes", 2000, name + u32(1) + text_attribute(1, bn_type_binary, "")},
-        {"one attribute again and again", 1, name + u32(2000) + times(2000, none)},
-        {"empty parts", 1, u8(1) + u32(20000) + times(20000, str("")) + u32(0)},
-        {"slashes", 1, u8(1) + u32(1) + str(wire(50000, '/')) + u32(0)},
+        {"nothing", 4000, pack(relative, 0, 0)},
+        {"name of one character", 4000, pack(name, 0)},
+        {"a part of one slash", 4000, pack(relative, 1, "/", 0)},
+        {"three empty parts", 4000, pack(relative, 3, "", "", "", 0)},
+        {"last attribute, no value", 2000, pack(relative, 0, 1, none)},
+        {"empty text", 2000, pack(name, 1, text_attribute(1, bn_type_str, ""))},
+        {"empty bytes", 2000, pack(name, 1, text_attribute(1, bn_type_binary, ""))},
+        {"one attribute again and again", 1, pack(name, 2000, times(2000, none))},
+        {"empty parts", 1, pack(absolute, 20000, times(20000, pack("")), 0)},
+        {"slashes", 1, pack(absolute, 1, 50000, wire(50000, '/'), 0)},
         {"an ordinary node", 500,
-         u8(1) + u32(4) + str("qv") + str("wccpd") + str("config") + str("51") + u32(1) +
-             text_attribute(1, bn_type_str, "value")},
+         pack(absolute, 4, "qv", "wccpd", "config", "51", 1, text_attribute(1, bn_type_str, "value"))},
     };
     for (const auto &shape : shapes)
-        for (const uint32_t type : {7u, 3u, 1u, 2u}) {
-            const wire node = u32(1000) + shape.node + (type % 2 && type < 5 ? u32(1) + u32(0) : wire());
-            const wire nodes = u32(shape.nodes) + times(shape.nodes, node);
-            const wire options = u32(0) + str("") + u32(0);
-            const wire bytes =
-                room + (type == 2 ? response(type, u32(0) + str("") + nodes + u32(0))
-                                  : request(type, str("") + nodes + (type == 7 ? str("e") : options)));
-            SCOPED_TRACE(std::string(shape.what) + " in " + std::to_string(type));
+        for (const bool answer : {false, true}) {
+            const wire nodes = pack(shape.nodes, times(shape.nodes, pack(1000, shape.node)));
+            const wire bytes = answer ? response(2, pack(0, "", nodes, 0)) : request(7, pack("", nodes, "e"));
+            SCOPED_TRACE(shape.what);
             buffer_owner buffer;
             request_owner asked;
             response_owner answered, copy;
@@ -315,58 +268,49 @@ TEST(messages, received_messages_are_bounded) {
             ids_owner ids;
             bn_node_info *info = nullptr;
             ASSERT_EQ(tb_new_buf(&buffer, bytes.data(), static_cast<int32_t>(bytes.size())), 0);
-            size_t taken[4] = {allocated()};
-            if (type == 2) {
-                ASSERT_EQ(bn_response_msg_deserialize(buffer, 32, &answered), 0);
-                taken[1] = allocated();
-                ASSERT_EQ(bn_response_msg_dup(answered, &copy), 0);
-                taken[2] = allocated();
-                ASSERT_EQ(bn_response_get_takeover(answered, nullptr, nullptr, 1, &with_parts, nullptr), 0);
-            } else {
-                ASSERT_EQ(bn_request_msg_deserialize(buffer, 32, &asked), 0);
-                taken[1] = allocated();
-                ASSERT_EQ(bn_request_get(asked, nullptr, nullptr, 0, &bindings, &ids, &info), 0);
-                taken[2] = allocated();
-                ASSERT_EQ(bn_request_get(asked, nullptr, nullptr, 1, &with_parts, nullptr, nullptr), 0);
+            const std::function<lc_status()> steps[2][3] = {
+                {[&] { return bn_request_msg_deserialize(buffer, 0, &asked); },
+                 [&] { return bn_request_get(asked, nullptr, nullptr, 0, &bindings, &ids, &info); },
+                 [&] { return bn_request_get(asked, nullptr, nullptr, 1, &with_parts, nullptr, nullptr); }},
+                {[&] { return bn_response_msg_deserialize(buffer, 0, &answered); },
+                 [&] { return bn_response_msg_dup(answered, &copy); },
+                 [&] {
+                     return bn_response_get_takeover(answered, nullptr, nullptr, 1, &with_parts, nullptr);
+                 }}};
+            const size_t overhead = 2048, limits[2][3] = {{8, 8, 17}, {8, 8, 10}};
+            for (size_t i = 0; i < 3; i++) {
+                const size_t before = allocated();
+                ASSERT_EQ(steps[answer][i](), 0);
+                EXPECT_LE(allocated() - before, limits[answer][i] * bytes.size() + overhead) << answer << i;
             }
-            taken[3] = allocated();
             free(info);
-            const size_t overhead = 2048, message = bytes.size() - 32;
-            EXPECT_LE(taken[1] - taken[0], 8 * message + overhead);
-            EXPECT_LE(taken[2] - taken[1], 8 * message + overhead);
-            EXPECT_LE(taken[3] - taken[2], (type == 2 ? 10 : 17) * message + overhead);
         }
 }
 
 // A received binding can outlive its message, be changed and copied, and give away its name and attributes.
 TEST(messages, received_bindings_can_be_kept) {
-    const wire node = u32(1000) + u8(1) + u32(1) + str("n") + u32(3) + text_attribute(1, bn_type_str, "v") +
-                      text_attribute(65, bn_type_binary, "b") + u32(1) + u32(129) + u32(bn_type_uint32) +
-                      u32(0) + u32(4) + u32(7);
-    const wire bare = u32(1000) + u8(1) + u32(0) + u32(0);
+    const wire node = pack(1000, absolute, 1, "n", 3, text_attribute(1, bn_type_str, "v"),
+                           text_attribute(65, bn_type_binary, "b"), 1, 129, bn_type_uint32, 0, 4, 7);
+    const wire bare = pack(1000, absolute, 0, 0);
     response_owner msg;
     bindings_owner bindings;
-    ASSERT_EQ(read(bn_response_msg_deserialize,
-                   room + response(2, u32(0) + str("") + u32(5) + node + node + node + bare + bare + u32(0)),
-                   &msg),
-              0);
+    ASSERT_EQ(read_response(response(2, pack(0, "", 5, node, node, node, bare, bare, 0)), &msg), 0);
     ASSERT_EQ(bn_response_get_takeover(msg, nullptr, nullptr, 0, &bindings, nullptr), 0);
     const auto value_of = [](const bn_binding *binding) {
         return text_of([&](char **out) { return bn_binding_get_str(binding, 1, 0, nullptr, out); });
     };
-    binding_owner kept, changed, emptied, first, second;
+    binding_owner kept, changed, emptied, first, second, copy, given;
     for (bn_binding **out :
          {&kept.pointer, &changed.pointer, &emptied.pointer, &first.pointer, &second.pointer})
         ASSERT_EQ(bn_binding_array_remove(bindings, 0, out), 0);
     msg.reset();
     bindings.reset();
 
-    binding_owner copy, given;
     ASSERT_EQ(bn_binding_set_name(changed, "/other"), 0);
     ASSERT_EQ(bn_binding_set_str(changed, 1, bn_type_str, 0, "w"), 0);
     ASSERT_EQ(bn_binding_set_uint32(changed, 2, 0, 9), 0);
-    ASSERT_EQ(bn_attrib_set_str(bn_attrib_array_get_quick(changed->attributes, 65), 65, bn_type_str, 0, "x"),
-              0);
+    bn_attrib *binary = bn_attrib_array_get_quick(changed->attributes, 65);
+    ASSERT_EQ(bn_attrib_set_str(binary, 65, bn_type_str, 0, "x"), 0);
     ASSERT_EQ(bn_binding_dup(changed, &copy), 0);
     changed.reset();
     EXPECT_EQ(value_of(copy), "w");
@@ -374,40 +318,30 @@ TEST(messages, received_bindings_can_be_kept) {
     EXPECT_STREQ(ts_str(bn_attrib_array_get_quick(copy->attributes, 65)->value.string), "x");
     EXPECT_STREQ(bn_binding_get_name_quick(copy), "/other");
 
-    ASSERT_EQ(
-        bn_binding_new_parts_components_takeover(&given, &emptied->name, nullptr, 1, &emptied->attributes),
-        0);
+    bn_attrib_array **attributes = &emptied->attributes;
+    ASSERT_EQ(bn_binding_new_parts_components_takeover(&given, &emptied->name, nullptr, 1, attributes), 0);
     emptied.reset();
-    EXPECT_STREQ(bn_binding_get_name_quick(given), "/n");
-    EXPECT_EQ(value_of(given), "v");
-
+    EXPECT_TRUE(bn_binding_get_name_quick(given) == wire("/n") && value_of(given) == "v");
     ASSERT_EQ(bn_binding_set_name(first, "/renamed"), 0);
     EXPECT_STREQ(bn_binding_get_name_quick(second), "/");
 
     request_owner forwarded;
     ASSERT_EQ(bn_event_request_msg_create(&forwarded, "/e"), 0);
     ASSERT_EQ(bn_event_request_msg_append_binding_takeover(forwarded, 0, &kept.pointer, nullptr), 0);
-    number(forwarded.pointer);
-    buffer_owner written;
-    ASSERT_EQ(bn_request_msg_serialize(forwarded, 32, &written), 0);
-    EXPECT_EQ(bytes_of(written), room + request(7, str("") + u32(1) + node + str("/e")));
+    expect_request(forwarded, 7, pack("", 1, node, "/e"));
 }
 
 TEST(messages, odd_messages_are_read) {
-    const wire start = room + request(7, str("") + u32(1) + u32(1000));
-    request_owner twice; // an attribute given twice: the later one counts
-    ASSERT_EQ(read_request(start + u8(1) + u32(1) + str("n") + u32(2) + text_attribute(1, bn_type_str, "v") +
-                               text_attribute(1, bn_type_str, "w") + str("e"),
-                           &twice),
-              0);
+    request_owner twice, unknown; // an attribute given twice: the later one counts
+    const wire both = text_attribute(1, bn_type_str, "v") + text_attribute(1, bn_type_str, "w");
+    ASSERT_EQ(read_request(request(7, pack("", 1, 1000, absolute, 1, "n", 2, both, "e")), &twice), 0);
     string_owner value;
     const bn_request_node *node = bn_request_per_node_array_get_quick(twice->nodes, 0);
     ASSERT_EQ(bn_binding_get_tstr(node->binding, 1, 0, nullptr, &value), 0);
     EXPECT_STREQ(ts_str(value), "w");
 
     gcl_log log;
-    request_owner unknown;
-    ASSERT_EQ(read_request(room + request(9, str("") + u32(0)), &unknown), 0);
+    ASSERT_EQ(read_request(request(9, pack("", 0)), &unknown), 0);
     EXPECT_EQ(log.count("illegal messsage of type 9"), 1);
     EXPECT_EQ(bn_request_get(unknown, nullptr, nullptr, 0, nullptr, nullptr, nullptr), LC_UNEXPECTED_CASE);
     EXPECT_EQ(bn_request_msg_response_msg_type(2), 0);
@@ -431,15 +365,12 @@ struct MessageSession : testing::Test {
         EXPECT_EQ(bn_query_response_msg_create(&answer, msg->msg_id, 0, nullptr), 0);
         return bn_response_msg_send(session, answer);
     }
-    static wire message(uint32_t type) {
+    static wire message(uint16_t type) {
         if (type % 2 == 0 && type >= 2 && type <= 8)
-            return response(type, u32(0) + str("message") + u32(0) + (type < 6 ? u32(1) : wire()));
-        const wire trailer = type < 5 ? u32(0) + str("") + u32(0) : str("/name");
-        return request(type, str("") + u32(0) + (type < 8 && type % 2 ? trailer : wire()));
+            return response(type, pack(0, "message", 0, type < 6 ? pack(1) : wire()));
+        return request(type, pack("", 0, type < 5 ? pack(0, "", 0) : pack("/name")));
     }
-    bool receive(uint32_t type, const wire &body) {
-        return with.deliver(frame_bytes(2, static_cast<uint16_t>(type), body));
-    }
+    bool receive(uint16_t type, const wire &body) { return with.deliver(frame_bytes(2, type, body)); }
 };
 
 TEST_F(MessageSession, EachTypeReachesItsCallback) {
@@ -452,7 +383,7 @@ TEST_F(MessageSession, EachTypeReachesItsCallback) {
     bn_set_global_callback_event_request_msg(with.instance, note, this);
     bn_set_global_callback_event_response_msg(with.instance, note, this);
     ASSERT_TRUE(with.open());
-    for (uint32_t type = 1; type <= 8; type++)
+    for (uint16_t type = 1; type <= 8; type++)
         EXPECT_TRUE(receive(type, message(type))) << type;
     EXPECT_EQ(calls, "1 2 3 4 5 6 7 8 ");
     EXPECT_EQ(log.count("Error code"), 0);
@@ -464,31 +395,32 @@ TEST_F(MessageSession, EachTypeReachesItsCallback) {
 TEST_F(MessageSession, WhatIsNotHandledIsLogged) {
     ASSERT_TRUE(with.open());
     bn_set_global_callback_query_request_msg(with.instance, note, this); // too late for this session
-    const auto expect_line = [&](uint32_t type, const wire &body, const std::string &line) {
+    const auto expect_line = [&](uint16_t type, const wire &body, const std::string &line) {
         EXPECT_TRUE(receive(type, body)) << line;
         EXPECT_EQ(log.count("session 1: " + line), 1) << line;
         log.clear();
     };
-    const wire kinds[] = {"query", "set", "action", "event"};
-    for (uint32_t i = 0; i < 4; i++) {
-        const std::string no = "proto bnode: no " + kinds[i];
-        expect_line(2 * i + 1, message(2 * i + 1), no + " request callback");
-        expect_line(2 * i + 2, message(2 * i + 2), no + " response callback: code = 0 msg = message");
+    uint16_t type = 1;
+    for (const wire no : {"no query", "no set", "no action", "no event"}) {
+        expect_line(type, message(type), "proto bnode: " + no + " request callback");
+        type++;
+        expect_line(type, message(type), "proto bnode: " + no + " response callback: code = 0 msg = message");
+        type++;
     }
-    for (const uint32_t type : {0u, 9u, 10u})
-        expect_line(type, message(type), "proto bnode: invalid body message type " + std::to_string(type));
+    for (const uint16_t bad : std::initializer_list<uint16_t>{0, 9, 10})
+        expect_line(bad, message(bad), "proto bnode: invalid body message type " + std::to_string(bad));
     // The message's own type decides.
     expect_line(7, message(9), "proto bnode: invalid body message type 9");
     expect_line(9, message(7), "proto bnode: invalid body message type 9");
-    expect_line(2, response(10, u32(0) + str("") + u32(0)), "proto bnode: invalid body message type 10");
-    expect_line(2, response(7, u32(0) + str("message") + u32(0)),
+    expect_line(2, response(10, pack(0, "", 0)), "proto bnode: invalid body message type 10");
+    expect_line(2, response(7, pack(0, "message", 0)),
                 "proto bnode: no event response callback: code = 0 msg = message");
     expect_line(2, wire("\x00\x03", 2) + message(2).substr(2), "service 3 not open: 2");
     bn_set_session_callback_query_request_msg(with.session, note, this);
-    for (const uint32_t frame_type : {1u, 3u})
+    for (const uint16_t frame_type : std::initializer_list<uint16_t>{1, 3})
         EXPECT_TRUE(receive(frame_type, message(1)));
     EXPECT_EQ(calls, "1 1 ");
-    EXPECT_FALSE(receive(7, request(7, str("") + u32(0) + u32(9) + "cut")));
+    EXPECT_FALSE(receive(7, request(7, pack("", 0, 9, wire("cut")))));
     EXPECT_GE(log.count("Error code 14011"), 1);
     EXPECT_EQ(log.count("session 1: closing after error condition"), 1);
     EXPECT_EQ(log.count("messsage"), 0);
@@ -509,11 +441,9 @@ TEST_F(MessageSession, SentMessagesAreNumbered) {
     for (const auto &[type, id, transaction] : expected) {
         const wire frame = with.provider.take_frame();
         ASSERT_GE(frame.size(), 48u);
-        EXPECT_EQ(number_at(frame, 24), 0x20000u | type);
-        EXPECT_EQ(number_at(frame, 32), 0x20000u | type); // service 2
-        EXPECT_EQ(number_at(frame, 36), frame.size());
-        EXPECT_EQ(number_at(frame, 40), id);
-        EXPECT_EQ(number_at(frame, 44), transaction);
+        const wire both = be(0x20000u | type, 4); // protocol 2, and service 2
+        EXPECT_EQ(frame.substr(24, 4), both);
+        EXPECT_EQ(frame.substr(32, 16), both + be(frame.size(), 4) + be(id, 4) + be(transaction, 4));
     }
     EXPECT_EQ(gcl_session_close(with.session, 0), 0);
     EXPECT_EQ(bn_request_msg_send(with.session, first), 0);
@@ -534,9 +464,8 @@ TEST_F(MessageSession, AResponseThatDoesNotFitIsReplaced) {
         ASSERT_EQ(bn_query_response_msg_append_binding_takeover(response, &binding.pointer, 9), 0);
         EXPECT_EQ(bn_response_msg_send(with.session, response), 0);
     };
-    const auto expect_refusal = [&](const wire &frame, const wire &words) {
-        EXPECT_EQ(frame.substr(frame.size() < 48 ? 0 : 48),
-                  u32(41) + u32(LC_NO_BUFFER_SPACE) + str(words) + u32(0) + u32(0));
+    const auto expect_refusal = [&](const wire &frame, const char *words) {
+        EXPECT_EQ(frame.substr(frame.size() < 48 ? 0 : 48), pack(41, LC_NO_BUFFER_SPACE, words, 0, 0));
     };
     answer(GCL_FRAME_MAX);
     expect_refusal(with.provider.take_frame(), "The answer is larger than a message: ask for less");
@@ -576,8 +505,8 @@ TEST_F(MessageSession, SentMessagesAreLogged) {
     binding_owner binding;
     ASSERT_EQ(bn_set_request_msg_create(&set, 0), 0);
     ASSERT_EQ(bn_binding_new_uint32(&binding, "/n", bn_attrib_value, 0, 7), 0);
-    ASSERT_EQ(bn_set_request_msg_append_binding_takeover(set, bn_set_create, 9, &binding.pointer, nullptr),
-              0);
+    uint32_t id = 0;
+    ASSERT_EQ(bn_set_request_msg_append_binding_takeover(set, bn_set_create, 9, &binding.pointer, &id), 0);
     EXPECT_EQ(dump_of([&] { return bn_request_msg_send(with.session, set); }),
               "SEND REQ:" + names + "3 (set_request) msg id 1\n" +
                   "SEND REQ: audit userinfo string - \nSEND REQ: num nodes: 1\n"
@@ -592,9 +521,9 @@ TEST_F(MessageSession, SentMessagesAreLogged) {
     for (int i = 0; i < 51; i++)
         ASSERT_EQ(bn_event_request_msg_append_new_binding(event, 0, "n", bn_type_str, "", nullptr), 0);
     const std::string dump = dump_of([&] { return bn_request_msg_send(with.session, event); });
-    EXPECT_NE(dump.find("event name: /e\n"), wire::npos);
-    EXPECT_NE(dump.find("num nodes: 51 (but only logging the first 50)\n"), wire::npos);
-    EXPECT_NE(dump.find("rn[49]: id 1049 n\n"), wire::npos);
+    for (const char *line :
+         {"event name: /e\n", "num nodes: 51 (but only logging the first 50)\n", "rn[49]: id 1049 n\n"})
+        EXPECT_NE(dump.find(line), wire::npos) << line;
     EXPECT_EQ(dump.find("rn[50]"), wire::npos);
 }
 

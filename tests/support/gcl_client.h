@@ -66,15 +66,10 @@ struct gcl_client {
         return gcl_session_send_frame_components(session, proto, mtype, static_cast<uint32_t>(body.size()),
                                                  body.data());
     }
-    int32_t state() {
-        int32_t out = -1;
-        EXPECT_EQ(gcl_session_get_state(session, &out, nullptr), LC_OK);
-        return out;
-    }
-    int32_t admin_state() {
-        int32_t out = -1;
-        EXPECT_EQ(gcl_session_get_state(session, nullptr, &out), LC_OK);
-        return out;
+    int32_t state(bool of_the_opening = false) {
+        int32_t state = -1, admin_state = -1;
+        EXPECT_EQ(gcl_session_get_state(session, &state, &admin_state), LC_OK);
+        return of_the_opening ? admin_state : state;
     }
     void finish() {
         EXPECT_EQ(gcl_deinit(&instance), LC_OK);

@@ -43,17 +43,10 @@ struct gcl_log {
         (void)sendto(sender, mark.data(), mark.size(), 0, reinterpret_cast<sockaddr *>(&address),
                      sizeof address);
         close(sender);
-        for (int tries = 0; tries < 10000; tries++) {
-            {
-                const std::lock_guard<std::mutex> guard(mutex);
-                if (!lines.empty() && lines.back() == mark) {
-                    lines.pop_back();
-                    return;
-                }
-                if (std::find(lines.begin(), lines.end(), mark) != lines.end())
-                    return;
-            }
-            usleep(500);
+        for (int tries = 0; tries < 10000; tries++, usleep(500)) {
+            const std::lock_guard<std::mutex> guard(mutex);
+            if (std::find(lines.begin(), lines.end(), mark) != lines.end())
+                return;
         }
     }
     int count(const std::string &part) {

@@ -40,9 +40,10 @@ inline wire greeting_bytes(uint32_t uid, uint32_t gid, uint16_t version = 2) {
                            be(gid, 4) + padded("admin", 32) + be(0, 4));
 }
 inline wire open_response_bytes(uint32_t request_id, uint32_t status, const wire &text = {}) {
+    const size_t length = text.empty() ? 0 : text.size() + 1;
     return frame_bytes(1, 4,
                        be(1, 4) + be(0, 4) + be(request_id, 4) + padded("peer", 32) + be(status, 4) +
-                           be(text.empty() ? 0 : text.size() + 1, 4) + (text.empty() ? wire() : text + '\0'));
+                           be(length, 4) + padded(text, length));
 }
 
 struct gcl_provider {
@@ -53,8 +54,7 @@ struct gcl_provider {
     bool listen_as(const wire &name) {
         mkdir("/tmp/gcl-socks", 0777);
         listener = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        sockaddr_un address{};
-        address.sun_family = AF_UNIX;
+        sockaddr_un address = {AF_UNIX, {}};
         strcpy(address.sun_path, path(name).c_str());
         unlink(address.sun_path);
         return bind(listener, reinterpret_cast<sockaddr *>(&address), sizeof address) == 0 &&
@@ -65,33 +65,23 @@ struct gcl_provider {
         unread.clear();
         return client >= 0;
     }
+    // Blocks until all bytes are sent.
     bool put(const wire &bytes) const {
-        size_t sent = 0;
-        while (sent < bytes.size()) {
-            const ssize_t now = send(client, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
-            if (now <= 0)
-                return false;
-            sent += static_cast<size_t>(now);
-        }
-        return true;
+        return send(client, bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
     }
     // Whole frames only; "" when the client closed or nothing came for `wait_ms`.
     wire take_frame(int wait_ms = 3000) {
-        for (;;) {
-            if (unread.size() >= 32 && unread.size() >= number_at(unread, 12)) {
-                const wire frame = unread.substr(0, number_at(unread, 12));
-                unread.erase(0, frame.size());
-                return frame;
-            }
+        while (unread.size() < 32 || unread.size() < number_at(unread, 12)) {
             pollfd watched = {client, POLLIN, 0};
-            if (poll(&watched, 1, wait_ms) <= 0)
-                return {};
             char bytes[65536];
-            const ssize_t got = recv(client, bytes, sizeof bytes, 0);
+            const ssize_t got = poll(&watched, 1, wait_ms) > 0 ? recv(client, bytes, sizeof bytes, 0) : 0;
             if (got <= 0)
                 return {};
             unread.append(bytes, static_cast<size_t>(got));
         }
+        const wire frame = unread.substr(0, number_at(unread, 12));
+        unread.erase(0, frame.size());
+        return frame;
     }
     // The provider's part of opening a session.
     bool open_session() {
@@ -101,13 +91,11 @@ struct gcl_provider {
         return request.size() == 80 && put(open_response_bytes(number_at(request, 32), 0));
     }
     void close_client() {
-        if (client >= 0)
-            close(client);
+        close(client);
         client = -1;
     }
     ~gcl_provider() {
-        close_client();
-        if (listener >= 0)
-            close(listener);
+        close(client);
+        close(listener);
     }
 };

@@ -22,8 +22,6 @@ struct hand_session {
         (void)gcl_deinit(&instance);
         (void)fdic_deinit(&interests);
     }
-    hand_session(const hand_session &) = delete;
-    hand_session &operator=(const hand_session &) = delete;
     // Call it after the callbacks are set: a session copies them when it is created.
     bool open() {
         if (!provider.listen_as("hand") ||

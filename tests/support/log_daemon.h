@@ -19,15 +19,11 @@ struct log_daemon {
 
     explicit log_daemon(int socket_type = SOCK_DGRAM) : type(socket_type) { start(); }
     ~log_daemon() { stop(); }
-    log_daemon(const log_daemon &) = delete;
-    log_daemon &operator=(const log_daemon &) = delete;
 
     void start() {
         unlink("/dev/log");
         listener = socket(AF_UNIX, type | SOCK_CLOEXEC, 0);
-        sockaddr_un address = {};
-        address.sun_family = AF_UNIX;
-        strcpy(address.sun_path, "/dev/log");
+        sockaddr_un address = {AF_UNIX, "/dev/log"};
         if (bind(listener, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0)
             perror("bind /dev/log");
         if (type == SOCK_STREAM)
@@ -44,19 +40,16 @@ struct log_daemon {
     std::vector<std::string> take(int quiet_ms = 20, size_t enough = SIZE_MAX) {
         std::vector<std::string> lines;
         for (;;) {
-            if (lines.size() >= enough)
-                return lines;
             const bool waits = type == SOCK_STREAM && accepted < 0;
-            const int fd = type == SOCK_STREAM && !waits ? accepted : listener;
-            pollfd watched = {fd, POLLIN, 0};
-            if (poll(&watched, 1, quiet_ms) <= 0)
+            pollfd watched = {type == SOCK_STREAM && !waits ? accepted : listener, POLLIN, 0};
+            if (lines.size() >= enough || poll(&watched, 1, quiet_ms) <= 0)
                 return lines;
             if (waits) {
                 accepted = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
                 continue;
             }
             char text[65536];
-            const ssize_t got = recv(fd, text, sizeof text, 0);
+            const ssize_t got = recv(watched.fd, text, sizeof text, 0);
             if (got <= 0) {
                 close(accepted);
                 accepted = -1;
