@@ -7,8 +7,8 @@
 #include <thread>
 
 #include "runtime/guards.h"
-#include "runtime/logging.h"
-#include "tests/support/log_daemon.h"
+#include "tests/support/log_lines.h"
+#include "tests/support/owners.h"
 
 namespace {
 
@@ -30,16 +30,12 @@ lc_status outer(lc_status status) {
 }
 
 struct Checks : testing::Test {
-    log_daemon daemon;
-    void SetUp() override { ASSERT_EQ(lc_log_init("check", nullptr, 0, 0x1060000, 7, 136, 1), LC_OK); }
-    void TearDown() override { (void)lc_log_close(); }
+    log_lines log;
     // Function and text of each line, without its place.
     std::string logged() {
-        static const std::regex form(".*\\[wccpd\\.ERR\\]: (.*)\\(\\), [a-z_]+\\.cpp:\\d+, build 1: (.*\n)");
-        std::string lines;
-        for (const std::string &line : daemon.take())
-            lines += std::regex_replace(line, form, "$1: $2");
-        return lines;
+        static const std::regex form(
+            ".*\\[wccpd\\.ERR\\]: wccpd: (.*)\\(\\), [a-z_]+\\.cpp:\\d+, build 1: (.*\n)\n");
+        return std::regex_replace(log.take(), form, "$1: $2");
     }
 };
 
@@ -47,23 +43,20 @@ TEST_F(Checks, EachFailureHasItsLineAtEachLevel) {
     EXPECT_EQ(outer(LC_NOT_FOUND), LC_NOT_FOUND);
     EXPECT_EQ(logged(), "inner: Error code 14004 (item not found) returned\n"
                         "outer: Error code 14004 (item not found) returned\n");
-    const struct {
-        char check;
-        lc_status status, result;
-        const char *line;
-    } cases[] = {
-        {'s', 14024, 14024, "Error code 14024 returned"},
-        {'s', LC_CANCELLED, LC_CANCELLED, nullptr},
-        {'q', LC_NOT_FOUND, LC_NOT_FOUND, nullptr},
-        {'n', 1, LC_NULL, "Unexpected NULL"},
-        {'c', 1, LC_ASSERTION, "Required condition was not met"},
-        {'f', LC_IO_CLOSED, LC_IO_CLOSED, "Bail forced with error code 14016 (IO source/sink is closed)"},
-        {'f', 3, 3, "Bail forced with error code 3"},
-        {'s', LC_OK, LC_OK, nullptr},
+    const std::tuple<char, lc_status, lc_status, std::string> cases[] = {
+        {'s', 14024, 14024, "inner: Error code 14024 returned\n"},
+        {'s', LC_CANCELLED, LC_CANCELLED, ""},
+        {'q', LC_NOT_FOUND, LC_NOT_FOUND, ""},
+        {'n', 1, LC_NULL, "inner: Unexpected NULL\n"},
+        {'c', 1, LC_ASSERTION, "inner: Required condition was not met\n"},
+        {'f', LC_IO_CLOSED, LC_IO_CLOSED,
+         "inner: Bail forced with error code 14016 (IO source/sink is closed)\n"},
+        {'f', 3, 3, "inner: Bail forced with error code 3\n"},
+        {'s', LC_OK, LC_OK, ""},
     };
-    for (const auto &each : cases) {
-        EXPECT_EQ(inner(each.check, each.status), each.result);
-        EXPECT_EQ(logged(), each.line ? "inner: " + std::string(each.line) + "\n" : "") << each.status;
+    for (const auto &[check, status, result, lines] : cases) {
+        EXPECT_EQ(inner(check, status), result);
+        EXPECT_EQ(logged(), lines) << status;
     }
 }
 
@@ -94,14 +87,10 @@ TEST(Strings, BoundedCopiesAndFormattedTexts) {
     EXPECT_EQ(strlcpy(text, "abc", 4), 3u);
     EXPECT_EQ(strlcat(text, "defgh", sizeof text), 8u);
     EXPECT_STREQ(text, "abcdefg");
-    EXPECT_EQ(strlcat(full, "12", sizeof full), 6u);
-    EXPECT_EQ(memcmp(full, "wxyz", 4), 0);
+    EXPECT_TRUE(strlcat(full, "12", sizeof full) == 6 && memcmp(full, "wxyz", 4) == 0);
     const std::string wanted(5000, 'x');
-    char *formatted = nullptr;
     uint32_t length = 1;
-    ASSERT_EQ(snmprintf(&formatted, &length, "%s", wanted.c_str()), LC_OK);
-    const owned_text owner(formatted);
-    EXPECT_EQ(formatted, wanted);
+    EXPECT_EQ(text_of([&](char **out) { return snmprintf(out, &length, "%s", wanted.c_str()); }), wanted);
     EXPECT_EQ(length, wanted.size());
 }
 

@@ -4,9 +4,8 @@
 
 #include <algorithm>
 #include <atomic>
+#include <numeric>
 #include <random>
-#include <string>
-#include <vector>
 
 #include "runtime/hash_table.h"
 #include "runtime/typed_arrays.h"
@@ -18,57 +17,43 @@ namespace {
 using numbers_owner = owner<uint32_array, uint32_array_free>;
 using array_owner = owner<array, array_free>;
 using table_owner = owner<ht, ht_free>;
-using numbers = std::vector<uint32_t>;
-
-void fill(numbers_owner &list, const numbers &values) {
-    ASSERT_EQ(uint32_array_new(&list), LC_OK);
-    for (const uint32_t value : values)
-        ASSERT_EQ(uint32_array_append(list, value), LC_OK);
-}
-numbers values(const uint32_array *list) {
-    numbers all;
-    for (uint32_t i = 0; i < uint32_array_length_quick(list); i++)
-        all.push_back(uint32_array_get_quick(list, i));
-    return all;
-}
 
 // --- Arrays
 
 TEST(Arrays, WalksAreSteered) {
-    const lc_status del = LC_FOREACH_DELETE;
     const struct {
-        std::vector<lc_status> script;
-        bool deletes;
+        lc_status second; // what the function returns for the second of three elements
         lc_status result;
-        size_t left_in_script;
-        numbers left;
+        uint32_t calls;
         const char *line;
     } cases[] = {
-        {{0, del, 0}, true, LC_OK, 0, {1, 3}, ""},
-        {{0, del, 0}, false, LC_ASSERTION, 1, {1, 2, 3}, "to delete element #1, but array_foreach_delete()"},
-        {{0, LC_FOREACH_HALT_ERROR, 0}, false, LC_GENERIC, 1, {1, 2, 3}, "Array element 1 halted iteration"},
-        {{LC_FOREACH_HALT_OK, 0, 0}, false, LC_OK, 2, {1, 2, 3}, ""},
-        {{LC_CANCELLED, 0, 0}, true, LC_OK, 2, {1, 2, 3}, ""},
-        {{LC_EXISTS, 0, 0}, true, LC_GENERIC, 0, {1, 2, 3}, "Got return code 14005 from foreach function"},
+        {LC_FOREACH_DELETE, LC_ASSERTION, 2, "to delete element #1, but array_foreach_delete()"},
+        {LC_FOREACH_HALT_ERROR, LC_GENERIC, 2, "Array element 1 halted iteration"},
+        {LC_FOREACH_HALT_OK, LC_OK, 2, ""},
+        {LC_CANCELLED, LC_OK, 2, ""},
+        {LC_EXISTS, LC_GENERIC, 3, "Got return code 14005 from foreach function"},
     };
     log_lines log;
+    numbers_owner list;
+    ASSERT_EQ(uint32_array_new(&list), LC_OK);
+    for (const uint32_t value : {1, 2, 3})
+        ASSERT_EQ(uint32_array_append(list, value), LC_OK);
+    using calls = std::pair<uint32_t, lc_status>; // their number, and the result of the second
+    const auto steer = [](uint32_array *, uint32_t, uint32_t value, void *data) {
+        auto *counted = static_cast<calls *>(data);
+        EXPECT_EQ(value, ++counted->first);
+        return value == 2 ? counted->second : LC_OK;
+    };
     for (const auto &each : cases) {
-        numbers_owner list;
-        fill(list, {1, 2, 3});
-        std::vector<lc_status> script = each.script;
-        const auto steer = [](uint32_array *, uint32_t, uint32_t, void *data) {
-            auto *rest = static_cast<std::vector<lc_status> *>(data);
-            const lc_status status = rest->front();
-            rest->erase(rest->begin());
-            return status;
-        };
-        const auto walk = each.deletes ? uint32_array_foreach_delete : uint32_array_foreach;
-        EXPECT_EQ(walk(list, steer, &script), each.result);
-        EXPECT_EQ(script.size(), each.left_in_script);
-        EXPECT_EQ(values(list), each.left);
+        calls counted = {0, each.second};
+        EXPECT_EQ(uint32_array_foreach(list, steer, &counted), each.result);
+        EXPECT_EQ(counted.first, each.calls);
         const std::string lines = log.take();
         EXPECT_TRUE(*each.line ? lines.find(each.line) != std::string::npos : lines.empty()) << lines;
     }
+    calls deleting = {0, LC_FOREACH_DELETE};
+    EXPECT_EQ(uint32_array_foreach_delete(list, steer, &deleting), LC_OK);
+    EXPECT_TRUE(uint32_array_length_quick(list) == 2 && uint32_array_get_quick(list, 1) == 3);
 }
 
 struct keyed {
@@ -111,43 +96,39 @@ TEST(Arrays, AgreeWithAModel) {
         uint32_t used = 0;
         for (int step = 0; step < 2500; step++) {
             SCOPED_TRACE(testing::Message() << "policy " << policy << ", step " << step);
-            store[used].key = random() % 200;
             keyed *fresh = &store[used];
+            fresh->key = random() % 200;
             void *element = fresh, *out = nullptr;
             const uint32_t place = model.empty() ? 0 : random() % static_cast<uint32_t>(model.size());
+            const auto at = model.begin() + place;
             const uint32_t change = model.size() < 30 ? random() % 8 : random() % 15;
-            const bool inserts = change >= 6 && change < 8 && list->sorted;
             lc_status status = LC_OK, wanted = LC_OK;
-            if (change < 6 || inserts) { // the operations that follow the policy
-                auto at =
-                    inserts ? std::upper_bound(model.begin(), model.end(), fresh, less_keyed) : model.end();
+            if (change < 6 || (change < 8 && list->sorted)) { // the operations that follow the policy
+                auto where = change < 6 ? model.end()
+                                        : std::upper_bound(model.begin(), model.end(), fresh, less_keyed);
                 auto equal = std::find_if(model.begin(), model.end(), [&](const keyed *old) {
                     return !less_keyed(old, fresh) && !less_keyed(fresh, old);
                 });
-                if (inserts && equal != model.end())
-                    equal = at - 1; // the last of several equal ones
+                if (change >= 6 && equal != model.end())
+                    equal = where - 1; // the last of several equal ones
                 const bool twice = policy != array_dup_allow && equal != model.end();
-                status = inserts ? array_insert_sorted_takeover(list, &element)
-                                 : array_append_takeover(list, &element);
+                status = change < 6 ? array_append_takeover(list, &element)
+                                    : array_insert_sorted_takeover(list, &element);
                 wanted = twice && policy == array_dup_refuse ? LC_EXISTS : LC_OK;
-                if (twice && policy == array_dup_replace) {
-                    const bool before = equal < at;
-                    const auto index = at - model.begin() - before;
-                    model.erase(equal);
-                    model.insert(model.begin() + index, fresh);
-                } else if (!twice) {
-                    model.insert(at, fresh);
-                }
+                if (!twice)
+                    model.insert(where, fresh);
+                else if (policy == array_dup_replace)
+                    *std::rotate(equal, equal + 1, where) = fresh;
             } else if (change == 8) {
                 status = array_insert_takeover(list, place, &element);
-                model.insert(model.begin() + place, fresh);
+                model.insert(at, fresh);
             } else if (change == 9) {
                 status = array_remove(list, place, &out);
-                ASSERT_EQ(out, model[place]);
-                model.erase(model.begin() + place);
+                ASSERT_EQ(out, *at);
+                model.erase(at);
             } else if (change == 10) {
                 status = array_remove_no_shift(list, place, &out);
-                model[place] = nullptr;
+                *at = nullptr;
             } else if (change == 11) {
                 status = array_set_takeover(list, place + 2, &element); // past the end as well
                 model.resize(std::max<size_t>(model.size(), place + 3));
@@ -155,8 +136,8 @@ TEST(Arrays, AgreeWithAModel) {
             } else if (change == 12) {
                 status = array_sort(list);
                 std::copy_n(reinterpret_cast<keyed **>(list->elements), model.size(), model.begin());
-            } else if (model.size() > 30 && model[place]) {
-                model[place]->key = random() % 200, changes++, list->sorted = 0;
+            } else if (model.size() > 30 && *at) {
+                (*at)->key = random() % 200, changes++, list->sorted = 0;
             }
             ASSERT_EQ(status, wanted);
             used += element == nullptr;
@@ -171,8 +152,8 @@ TEST(Arrays, AgreeWithAModel) {
             ASSERT_EQ(best, linear);
             ASSERT_TRUE(list->sorted || array_binary_search(list, &key, &best) == LC_ASSERTION);
         }
-        EXPECT_TRUE(array_get(list, list->length, reinterpret_cast<void **>(&model[0])) == LC_NOT_FOUND &&
-                    !model[0]);
+        void *none = &store;
+        EXPECT_TRUE(array_get(list, list->length, &none) == LC_NOT_FOUND && !none);
         EXPECT_TRUE(array_append(list, &store[0]) == LC_ASSERTION && array_empty(list) == LC_OK &&
                     list->sorted);
     }
@@ -209,13 +190,10 @@ TEST(Memory, EachAllocationFailsWithTheSameLine) {
         table_owner table;
         failing_calloc = call;
         EXPECT_EQ(array_new(&list, nullptr), LC_NULL);
+        EXPECT_TRUE(log.say("array_new(), array.cpp:"));
         failing_calloc = call;
         EXPECT_EQ(ht_new(&table, nullptr), LC_NULL);
-        const std::string lines = log.take();
-        EXPECT_TRUE(lines.find("array_new(), array.cpp:") != std::string::npos &&
-                    lines.find("ht_new(), hash_table.cpp:") != std::string::npos &&
-                    lines.find("forced") == std::string::npos)
-            << lines;
+        EXPECT_TRUE(log.say("ht_new(), hash_table.cpp:"));
     }
 }
 #endif
@@ -225,7 +203,6 @@ TEST(Memory, EachAllocationFailsWithTheSameLine) {
 TEST(Hash, IsThePublishedOne) {
     const std::string name = "/qv/wccpd/wccp/srv_grp/config/51/weight"; // three rounds and a rest
     EXPECT_EQ(ht_bjh_hash("", 0, 0), 0xbd49d10du);
-    EXPECT_EQ(ht_bjh_hash("a", 1, 0), 0x29eec818u);
     EXPECT_EQ(ht_bjh_hash("hello world", 11, 0), 0x1aa919e6u);
     EXPECT_EQ(ht_hash_string_func(name.data(), static_cast<uint32_t>(name.size())), 0x6227581au);
 }
@@ -247,12 +224,11 @@ struct HashTable : testing::Test {
     }
 };
 TEST_F(HashTable, GrowsAndShrinks) {
-    numbers keys(2000);
-    for (uint32_t i = 0; i < keys.size(); i++)
-        keys[i] = i;
+    std::vector<uint32_t> keys(2000);
+    std::iota(keys.begin(), keys.end(), 0);
     const uint32_t cases[][2] = {{93, 31}, {94, 124}, {21, 124}, {20, 31}, {2000, 1984}};
     for (const auto &[entries, buckets] : cases) { // the number of buckets once there are so many entries
-        for (; table->entry_count < entries;) {
+        while (table->entry_count < entries) {
             uint32_t *key = &keys[table->entry_count];
             ASSERT_EQ(ht_insert(table, key, sizeof *key, key), LC_OK);
         }

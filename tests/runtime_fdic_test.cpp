@@ -28,11 +28,8 @@ struct FdicList : testing::Test {
         }
         return LC_OK;
     }
-    void SetUp() override { ASSERT_EQ(fdic_init(&list, take, this), LC_OK); }
-    void TearDown() override {
-        EXPECT_EQ(fdic_deinit(&list), LC_OK);
-        EXPECT_EQ(list, nullptr);
-    }
+    FdicList() { EXPECT_EQ(fdic_init(&list, take, this), LC_OK); }
+    ~FdicList() override { EXPECT_EQ(fdic_deinit(&list), LC_OK); }
     int32_t id = -5; // of the interest that was added last
     lc_status add_fd(int fd, int want_read, int want_write) {
         return fdic_event_add_fd(list, fd, want_read, want_write, nullptr, nullptr, nullptr, nullptr, nullptr,
@@ -51,7 +48,12 @@ struct FdicList : testing::Test {
 TEST_F(FdicList, EachChangeIsReportedOnce) {
     gcl_log log;
     expect("1+ ", add_fd(10, 1, 0));
-    EXPECT_EQ(id, 1);
+    fdic_event_array *copy = nullptr;
+    ASSERT_EQ(fdic_events_query(list, &copy), LC_OK);
+    fdic_event *event = fdic_event_array_get_quick(copy, 0);
+    EXPECT_TRUE(fdic_event_array_length_quick(copy) == 1 && event->id == 1 && event->fd == 10);
+    event->want_read = 0;
+    EXPECT_EQ(fdic_event_array_free(&copy), LC_OK);
     expect("", fdic_event_update_fd(list, 1, 1, 0)); // no change
     expect("1+ ", fdic_event_update_fd(list, 1, 1, 1));
     expect("", add_fd(-1, 1, 1));
@@ -73,23 +75,6 @@ TEST_F(FdicList, EachChangeIsReportedOnce) {
         EXPECT_EQ(log.count(line), 1) << line;
 }
 
-TEST_F(FdicList, TheQueryIsACopyInOrder) {
-    for (int fd = 20; fd < 24; fd++)
-        EXPECT_EQ(add_fd(fd, fd % 2, 1), LC_OK);
-    EXPECT_EQ(fdic_event_delete_fd(list, 2), LC_OK);
-    fdic_event_array *events = nullptr;
-    ASSERT_EQ(fdic_events_query(list, &events), LC_OK);
-    ASSERT_EQ(fdic_event_array_length_quick(events), 3u);
-    for (uint32_t i = 0; i < 3; i++) {
-        fdic_event *event = fdic_event_array_get_quick(events, i);
-        EXPECT_TRUE(event->id == (i ? i + 2 : 1) && event->fd == static_cast<int>(event->id) + 19);
-        event->fd = 1000;
-    }
-    EXPECT_EQ(fdic_event_array_free(&events), LC_OK);
-    reported.clear();
-    expect("3+ ", fdic_event_update_fd(list, 3, 1, 1));
-}
-
 // --- With the bridge
 
 struct FdicBridge : testing::Test {
@@ -97,14 +82,14 @@ struct FdicBridge : testing::Test {
     fdic_libevent *bridge = nullptr;
     fdic *list = nullptr;
     int ends[2] = {-1, -1};
-    std::vector<std::string> calls;
+    std::string calls; // "1:2 ": of this kind, with this argument
     std::function<lc_status(uint32_t)> on_call;
 
     static lc_status called(int fd, uint32_t kind, void *user_data, void *argument) {
         auto *self = static_cast<FdicBridge *>(user_data);
         EXPECT_TRUE(kind == FDIC_TIMER_EXPIRED ? fd == -1 : fd == self->ends[0]);
-        self->calls.push_back(std::to_string(kind) + ":" +
-                              std::to_string(reinterpret_cast<uintptr_t>(argument)));
+        self->calls +=
+            std::to_string(kind) + ":" + std::to_string(reinterpret_cast<uintptr_t>(argument)) + " ";
         return self->on_call ? self->on_call(kind) : LC_OK;
     }
     void SetUp() override {
@@ -130,26 +115,25 @@ struct FdicBridge : testing::Test {
                   LC_OK);
         return id;
     }
-    std::vector<std::string> round() {
+    void expect_round(const char *expected) {
         calls.clear();
         EXPECT_EQ(lew_dispatch_once(wrapper, nullptr, nullptr), LC_OK);
-        return calls;
+        EXPECT_EQ(calls, expected);
     }
-    using list_of = std::vector<std::string>;
 };
 
 TEST_F(FdicBridge, InterestsFollowTheirChanges) {
     const int32_t id = add(1, 0);
-    EXPECT_EQ(calls, (list_of{"4:44"}));
+    EXPECT_EQ(calls, "4:44 ");
     ASSERT_EQ(write(ends[1], "x", 1), 1);
-    EXPECT_EQ(round(), (list_of{"1:1"}));
+    expect_round("1:1 ");
     EXPECT_EQ(fdic_event_update_fd(list, id, 0, 1), LC_OK);
-    EXPECT_EQ(round(), (list_of{"2:2"}));
+    expect_round("2:2 ");
     EXPECT_EQ(fdic_event_update_fd(list, id, 1, 1), LC_OK);
-    EXPECT_EQ(round(), (list_of{"1:1", "2:2"}));
+    expect_round("1:1 2:2 ");
     calls.clear();
     EXPECT_EQ(fdic_event_delete_fd(list, id), LC_OK);
-    EXPECT_EQ(calls, (list_of{"5:55"}));
+    EXPECT_EQ(calls, "5:55 ");
     int none = 0;
     EXPECT_EQ(lew_dispatch(wrapper, &none, nullptr), LC_OK);
     EXPECT_EQ(none, 1);
@@ -161,27 +145,27 @@ TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
     ASSERT_EQ(write(ends[1], "x", 1), 1);
     for (const lc_status status : {LC_BAD_TYPE, LC_CANCELLED}) { // a failure ends this round of calls
         on_call = [status](uint32_t) { return status; };
-        EXPECT_EQ(round(), (list_of{"1:1"}));
+        expect_round("1:1 ");
         EXPECT_EQ(log.count("Error code"), 1);
     }
     on_call = [&](uint32_t kind) { // the write function is still called after the interest is deleted
         return kind == FDIC_READABLE ? fdic_event_delete_fd(list, id) : LC_OK;
     };
-    EXPECT_EQ(round(), (list_of{"1:1", "5:55", "2:2"}));
+    expect_round("1:1 5:55 2:2 ");
 }
 
 TEST_F(FdicBridge, TimersFireOnce) {
     int32_t id = 0, soon = 0;
     int none = 0;
     ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, word(3), &id), LC_OK);
-    EXPECT_EQ(round(), (list_of{"3:3"}));
+    expect_round("3:3 ");
     EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay does not start it again
     EXPECT_EQ(lew_dispatch_once(wrapper, &none, nullptr), LC_OK);
     EXPECT_EQ(none, 1);
     // The largest delay does not overflow.
     EXPECT_EQ(fdic_event_update_timer(list, id, INT64_MAX), LC_OK);
     ASSERT_EQ(fdic_event_add_timer(list, 1, this, called, word(9), &soon), LC_OK);
-    EXPECT_EQ(round(), (list_of{"3:9"}));
+    expect_round("3:9 ");
     EXPECT_EQ(fdic_event_delete_timer(list, id), LC_OK);
 }
 
@@ -193,18 +177,18 @@ TEST_F(FdicBridge, ChangesOfAnotherThreadAreAppliedByTheLoop) {
     ASSERT_EQ(write(ends[1], "x", 1), 1);
     std::thread([&] { EXPECT_EQ(fdic_event_delete_fd(list, id), LC_OK); }).join();
     EXPECT_TRUE(calls.empty());
-    EXPECT_EQ(round(), (list_of{"5:55"})); // and not 1:1
+    expect_round("5:55 "); // and not 1:1
     int32_t second = 0;
     std::thread([&] {
         second = add(1, 0);
         EXPECT_EQ(fdic_event_update_fd(list, second, 1, 1), LC_OK);
     }).join();
-    EXPECT_EQ(round(), (list_of{"4:44"}));
-    EXPECT_EQ(round(), (list_of{"1:1", "2:2"}));
+    expect_round("4:44 ");
+    expect_round("1:1 2:2 ");
     std::thread([&] { EXPECT_EQ(fdic_event_update_fd(list, second, 0, 0), LC_OK); }).join();
     calls.clear();
     EXPECT_EQ(fdic_event_update_fd(list, second, 0, 1), LC_OK); // after the other's change
-    EXPECT_EQ(round(), (list_of{"2:2"}));
+    expect_round("2:2 ");
     std::thread([&] { EXPECT_EQ(fdic_event_delete_fd(list, second), LC_OK); }).join();
     calls.clear(); // freed while the change is still posted
 }

@@ -1,9 +1,6 @@
 // The format of a line, the levels that decide whether it is written, and the files that the log checks.
-#include "runtime/logging.h"
-
 #include <gtest/gtest.h>
 
-#include <cerrno>
 #include <filesystem>
 #include <fstream>
 #include <regex>
@@ -21,9 +18,7 @@ constexpr const char *ZONE = "/var/opt/rvl/output/localtime";
 
 void set_link(const char *target) {
     unlink(LINK);
-    if (target) {
-        ASSERT_EQ(symlink(target, LINK), 0);
-    }
+    ASSERT_EQ(symlink(target, LINK), 0);
 }
 void write_file(const char *path, const std::string &text) {
     std::ofstream(path) << text;
@@ -38,8 +33,8 @@ std::string body(const std::string &line) {
     const size_t mark = line.find("TID ");
     return mark == std::string::npos ? line : line.substr(line.find(": ", mark) + 2);
 }
-bool matches(const std::string &text, const char *pattern) {
-    return std::regex_match(text, std::regex(pattern));
+testing::AssertionResult matches(const std::string &text, const char *pattern) {
+    return testing::AssertionResult(std::regex_match(text, std::regex(pattern))) << text;
 }
 
 struct Log : testing::Test {
@@ -58,7 +53,7 @@ struct Log : testing::Test {
         return lc_log_init(name, prefix, flags, 0x1060000, 7, 136, destinations);
     }
     void TearDown() override {
-        set_link(nullptr);
+        unlink(LINK);
         (void)lc_log_close();
     }
 };
@@ -67,10 +62,8 @@ struct Log : testing::Test {
 TEST_F(Log, TheFirstLineSetsUpTheLog) {
     ASSERT_EQ(G_log_state_lock, nullptr);
     LC_LOG(LC_LOG_NOTICE, "early");
-    const std::string line = daemon.one();
-    EXPECT_TRUE(matches(line, "<13>.*runtime_logging_test-UNINIT\\[\\d+\\]: TID \\d+: \\[unk\\.NOTICE\\]: "
-                              "unk: early\n"))
-        << line;
+    EXPECT_TRUE(matches(daemon.one(), "<13>.*runtime_logging_test-UNINIT\\[\\d+\\]: TID \\d+: "
+                                      "\\[unk\\.NOTICE\\]: unk: early\n"));
 }
 
 TEST_F(Log, ALineHasTheBytesOfVsyslog) {
@@ -78,8 +71,7 @@ TEST_F(Log, ALineHasTheBytesOfVsyslog) {
     for (const size_t length : {5u, 1000u, 9000u}) {
         const std::string text(length, 'x');
         std::string theirs, ours;
-        for (int attempt = 0; attempt < 3 && (ours.empty() || ours != theirs);
-             attempt++) { // the second may change in between
+        for (int attempt = 0; attempt < 3 && (ours.empty() || ours != theirs); attempt++) { // in one second
             (void)lc_log_internal(nullptr, nullptr, 0, LC_LOG_FLAG_NO_THREAD, 0, LC_LOG_WARNING, "%s",
                                   text.c_str());
             ours = daemon.one();
@@ -133,11 +125,11 @@ TEST_F(Log, WhatDoesNotFitIsCut) {
 TEST_F(Log, LevelsAndTheirOrder) {
     ASSERT_EQ(init(), LC_OK);
     EXPECT_EQ(lc_log_set_max_log_level("debug"), LC_OK);
-    static const struct { int32_t own, passes; } rows[] = {{3, 3}, {0, 0}, {-1, 7}};
-    for (const auto &row : rows) {
-        EXPECT_EQ(lc_log_set_daemon_log_level(row.own), LC_OK);
-        EXPECT_TRUE(lc_log_check_level(row.passes) && !lc_log_check_level(row.passes + 1)) << row.own;
-        EXPECT_EQ(level_of_mask(), row.passes);
+    static const std::pair<int32_t, int32_t> levels[] = {{3, 3}, {0, 0}, {-1, 7}}; // own, and what passes
+    for (const auto &[own, passes] : levels) {
+        EXPECT_EQ(lc_log_set_daemon_log_level(own), LC_OK);
+        EXPECT_TRUE(lc_log_check_level(passes) && !lc_log_check_level(passes + 1)) << own;
+        EXPECT_EQ(level_of_mask(), passes);
     }
     EXPECT_EQ(lc_log_set_max_log_level("Err"), LC_BAD_TYPE);
     EXPECT_EQ(lc_log_set_max_log_level("warning"), LC_OK);
@@ -159,31 +151,31 @@ TEST_F(Log, LevelsAndTheirOrder) {
 }
 
 TEST_F(Log, TheOverrideAppliesWhileBothSwitchesAreOn) {
-    const auto leaves = [](lc_status status, int32_t level) {
-        return status == LC_OK && G_log_level == level;
-    };
     ASSERT_EQ(init(), LC_OK);
-    EXPECT_TRUE(leaves(lc_log_set_override_log_level("debug"), 5));
-    EXPECT_TRUE(leaves(lc_log_enable_override_log_level(1, 1), 5));
-    EXPECT_TRUE(leaves(lc_log_enable_override_log_level(0, 1), 7));
-    EXPECT_TRUE(leaves(lc_log_set_max_log_level("err"), 7)); // applies after the override
-    EXPECT_TRUE(leaves(lc_log_set_override_log_level("info"), 6));
-    EXPECT_TRUE(leaves(lc_log_set_override_log_level("nonsense"), 3)); // ends the override
-    EXPECT_TRUE(leaves(lc_log_enable_override_log_level(0, 1), 3));
-    EXPECT_TRUE(leaves(lc_log_set_override_log_level("debug"), 7));
-    EXPECT_TRUE(leaves(lc_log_set_daemon_log_level(1), 7));
-    EXPECT_TRUE(leaves(lc_log_enable_override_log_level(1, 0), 3));
-    EXPECT_EQ(level_of_mask(), 1); // that of the process
-    EXPECT_TRUE(
-        leaves(lc_log_enable_override_log_level(0, 0), 3)); // the current level becomes the override level
-    EXPECT_TRUE(leaves(lc_log_enable_override_log_level(0, 1), 3));
-    EXPECT_TRUE(leaves(lc_log_enable_override_log_level(1, 1), 3));
+    const auto expect = [](lc_status status, int32_t level) {
+        EXPECT_EQ(status, LC_OK);
+        EXPECT_EQ(G_log_level, level);
+    };
+    expect(lc_log_set_override_log_level("debug"), 5);
+    expect(lc_log_enable_override_log_level(1, 1), 5);
+    expect(lc_log_enable_override_log_level(0, 1), 7);
+    expect(lc_log_set_max_log_level("err"), 7); // applies after the override
+    expect(lc_log_set_override_log_level("info"), 6);
+    expect(lc_log_set_override_log_level("nonsense"), 3); // ends the override
+    expect(lc_log_enable_override_log_level(0, 1), 3);
+    expect(lc_log_set_override_log_level("debug"), 7);
+    expect(lc_log_set_daemon_log_level(1), 7);
+    expect(lc_log_enable_override_log_level(1, 0), 3);
+    EXPECT_EQ(level_of_mask(), 1);                     // that of the process
+    expect(lc_log_enable_override_log_level(0, 0), 3); // the current level becomes the override level
+    expect(lc_log_enable_override_log_level(0, 1), 3);
+    expect(lc_log_enable_override_log_level(1, 1), 3);
 }
 
 TEST_F(Log, TheLevelLink) {
-    static const std::pair<const char *, int32_t> rows[] = {
+    static const std::pair<const char *, int32_t> links[] = {
         {"7", 7}, {"0", 0}, {"99", 5}, {"-3", 5}, {"x", 5}, {"3x", 5}, {"77777777777777777777777", 5}};
-    for (const auto &[target, level] : rows) {
+    for (const auto &[target, level] : links) {
         set_link(target);
         ASSERT_EQ(init(), LC_OK);
         EXPECT_EQ(G_log_level, level) << target;
@@ -215,10 +207,9 @@ TEST_F(Log, AConsoleGetsAHeaderAndKeepsItsLevel) {
     EXPECT_EQ(lc_log_set_max_log_level("emerg"), LC_OK);
     testing::internal::CaptureStderr();
     LC_LOG(LC_LOG_ERR, "seen %d", 1);
-    const std::string text = testing::internal::GetCapturedStderr();
-    EXPECT_TRUE(matches(text, "[A-Z][a-z]{2} [ 1-3][0-9] [0-9:]{8} [^ .]+ tool\\[\\d+\\]: TID \\d+: "
-                              "\\[wccpd\\.ERR\\]: seen 1\n"))
-        << text;
+    EXPECT_TRUE(matches(testing::internal::GetCapturedStderr(),
+                        "[A-Z][a-z]{2} [ 1-3][0-9] [0-9:]{8} [^ .]+ tool\\[\\d+\\]: TID \\d+: "
+                        "\\[wccpd\\.ERR\\]: seen 1\n"));
     EXPECT_EQ(daemon.take().size(), 0u);
 }
 
@@ -233,7 +224,6 @@ TEST_F(Log, AfterTheCloseLinesAreDropped) {
 
 TEST(Files, TheFacilityAndTheDebugLog) {
     static constexpr const char *FACILITY = "/var/opt/rvl/syslog_fac.conf", *DEBUG = "/var/log/debug_log";
-    unlink(FACILITY);
     EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 136);
     write_file(FACILITY, "# system 8\nflow 144\nsystem\n\nsystem 160\nsystem 176\n");
     EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 160);

@@ -9,14 +9,12 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
-#include <memory>
 
 #include <csignal>
 #include <sched.h>
 #include <sys/mman.h>
 #include <sys/shm.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
 #include "runtime/csys.h"
 #include "runtime/logging.h"
@@ -63,11 +61,7 @@ int in_process(bool own_keys, const std::function<void()> &body) {
     return status;
 }
 
-} // namespace
-
 #define IN_CHILD(...) ASSERT_EQ(in_process(true, [&]() __VA_ARGS__), 0)
-
-namespace {
 
 // The bytes of the registry, which is created empty if it does not exist.
 uint8_t *registry_bytes() {
@@ -97,8 +91,16 @@ struct Blocks : testing::Test {
     // Exactly one line was logged, and contains this text.
     testing::AssertionResult logged(const std::string &text) {
         const std::string line = daemon.one();
-        return line.find(text) != std::string::npos ? testing::AssertionSuccess()
-                                                    : testing::AssertionFailure() << line;
+        return testing::AssertionResult(line.find(text) != std::string::npos) << line;
+    }
+    // A process of its own ends by abort() when it attaches the registry.
+    void expect_abort(const std::function<void()> &prepare) {
+        const int status = in_process(true, [&] {
+            prepare();
+            (void)cmem_attach_registry();
+        });
+        EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
+        EXPECT_TRUE(logged("cmem_attach_registry: Cannot attach to shmem, err=Invalid argument\n"));
     }
 };
 
@@ -125,16 +127,10 @@ TEST_F(Blocks, ANewBlockIsFoundByOthersAndInTheRegistry) {
         const uint8_t *bytes = registry_bytes();
         EXPECT_STREQ(reinterpret_cast<const char *>(bytes), "block");
         EXPECT_STREQ(reinterpret_cast<const char *>(bytes + 336064), "other");
-        const std::pair<size_t, uint32_t> words[] = {{64, 12288},
-                                                     {72, 4096},
-                                                     {80, ~1u},
-                                                     {84, 0x12345},
-                                                     {112, static_cast<uint32_t>(getpid())},
-                                                     {156, 1},
-                                                     {160, 1},
-                                                     {336064 + 48, ~0u},
-                                                     {336064 + 52, 0x12346},
-                                                     {361600, 1}};
+        const auto pid_word = static_cast<uint32_t>(getpid());
+        const std::pair<size_t, uint32_t> words[] = {
+            {64, 12288}, {72, 4096}, {80, ~1u},          {84, 0x12345},          {112, pid_word},
+            {156, 1},    {160, 1},   {336064 + 48, ~0u}, {336064 + 52, 0x12346}, {361600, 1}};
         for (const auto &[at, wanted] : words)
             EXPECT_EQ(memcmp(bytes + at, &wanted, sizeof wanted), 0) << at;
     });
@@ -172,30 +168,26 @@ TEST_F(Blocks, OfTwoProcessesExactlyOneCreatesABlock) {
     constexpr int ROUNDS = 300;
     IN_CHILD({
         ASSERT_TRUE(cmem_attach_registry());
-        (void)lc_log_set_daemon_log_level(0); // a refusal is logged each time
-        struct meeting {
-            std::atomic<int> ready, done, created;
-        };
-        auto *both = static_cast<meeting *>(
-            mmap(nullptr, sizeof(meeting), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
+        (void)lc_log_set_daemon_log_level(0);           // a refusal is logged each time
+        auto *counts = static_cast<std::atomic<int> *>( // ready, created, done
+            mmap(nullptr, 4096, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
         const auto meet = [](std::atomic<int> *count) {
             for (++*count; *count < 2;)
                 sched_yield();
         };
         int wrong = 0;
         for (int round = 0; round < ROUNDS; round++) {
-            both->ready = both->done = both->created = 0;
-            pid_t processes[2];
-            for (pid_t &process : processes)
-                if ((process = fork()) == 0) {
-                    meet(&both->ready);
-                    both->created += create(BLOCK_BYTES, "block") != nullptr;
-                    meet(&both->done);
+            counts[0] = counts[1] = counts[2] = 0;
+            for (int process = 0; process < 2; process++)
+                if (fork() == 0) {
+                    meet(&counts[0]);
+                    counts[1] += create(BLOCK_BYTES, "block") != nullptr;
+                    meet(&counts[2]);
                     _exit(0);
                 }
-            for (const pid_t process : processes)
-                (void)waitpid(process, nullptr, 0);
-            wrong += both->created != 1;
+            while (wait(nullptr) > 0)
+                continue;
+            wrong += counts[1] != 1;
             if (round % 2 == 0)
                 memset(registry_bytes(), 0, 336000);
         }
@@ -217,20 +209,16 @@ TEST_F(Blocks, ARegistryThatIsNotReady) {
         EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
         EXPECT_EQ(registry_state(), READY);
     });
-    const int status = in_process(true, [&] {
-        registry_state() = 7;
-        (void)cmem_attach_registry();
-    });
-    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
-    EXPECT_TRUE(logged("cmem_attach_registry: Cannot attach to shmem, err=Invalid argument\n"));
+    expect_abort([] { registry_state() = 7; });
     IN_CHILD({ // the next process tries to read the file again
+        const auto expect_unreadable = [&](const std::string &error) {
+            EXPECT_EQ(in_process(false, [] { EXPECT_TRUE(cmem_attach_registry()); }), 0);
+            EXPECT_TRUE(logged("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=" + error + "\n"));
+        };
         std::filesystem::remove(CMEM_CONF_PATH);
-        EXPECT_EQ(in_process(false, [] { EXPECT_TRUE(cmem_attach_registry()); }), 0);
-        EXPECT_TRUE(
-            logged("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=No such file or directory\n"));
+        expect_unreadable("No such file or directory");
         std::filesystem::create_directory(CMEM_CONF_PATH);
-        EXPECT_EQ(in_process(false, [] { EXPECT_TRUE(cmem_attach_registry()); }), 0);
-        EXPECT_TRUE(logged("cmem_load_conf: cannot read /etc/opt/rvl/mem.conf, err=Is a directory\n"));
+        expect_unreadable("Is a directory");
         std::filesystem::remove(CMEM_CONF_PATH);
         write_conf("block local normal 12345\n");
         EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
@@ -263,14 +251,8 @@ TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
             EXPECT_TRUE(create(BLOCK_BYTES, "block") && cmem_attach_block("block", &length));
             EXPECT_EQ(length, 12288u);
         });
-    for (const size_t bytes : {size_t{1}, REGISTRY_BYTES - 1}) { // a registry that is too short
-        const int status = in_process(true, [&] {
-            ASSERT_GE(shmget(CMEM_REGISTRY_KEY, bytes, IPC_CREAT | 0777), 0);
-            (void)cmem_attach_block("block");
-        });
-        EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
-        EXPECT_TRUE(logged(": Cannot attach to shmem, err=Invalid argument\n"));
-    }
+    for (const size_t bytes : {size_t{1}, REGISTRY_BYTES - 1}) // a registry that is too short
+        expect_abort([&] { ASSERT_GE(shmget(CMEM_REGISTRY_KEY, bytes, IPC_CREAT | 0777), 0); });
 }
 
 TEST_F(Blocks, LinesOfTheConfiguration) {
@@ -286,13 +268,12 @@ TEST_F(Blocks, LinesOfTheConfiguration) {
         EXPECT_NE(create(1, longest.c_str()), nullptr);
         EXPECT_GE(shmget(0x2a, 0, 0), 0);
         const std::vector<std::string> lines = daemon.take();
-        const std::string wanted[] = {": error parsing affinity at line bad 12 normal 1\n",
-                                      ": error parsing affinity at line bad\n",
-                                      ": error parsing page size at line worse inter enormous 1\n",
+        const std::string wanted[] = {"affinity at line bad 12 normal 1\n", "affinity at line bad\n",
+                                      "page size at line worse inter enormous 1\n",
                                       "affinity at line " + std::string(255, 'b') + "\n"};
         ASSERT_EQ(lines.size(), 4u);
         for (size_t i = 0; i < 4; i++)
-            EXPECT_NE(lines[i].find(wanted[i]), std::string::npos) << lines[i];
+            EXPECT_NE(lines[i].find("error parsing " + wanted[i]), std::string::npos) << lines[i];
         for (const std::string name : {"bad", "worse", "registry", "nokey", "big", "words", "unlisted"}) {
             EXPECT_EQ(create(1, name.c_str()), nullptr);
             EXPECT_TRUE(logged("attempt to create shared block " + name + " conflicts with conf file\n"));
@@ -311,19 +292,19 @@ TEST(DisplayBuffer, HoldsWhatFits) {
         csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.get() + offset, 1024);
         ASSERT_NE(buffer, nullptr);
         EXPECT_EQ(csys_display_buf_bytes_max(buffer), 991u);
-        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, ""), 0u);
-        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "abc"), 3u);
+        const auto append = [&](const std::string &added) {
+            return csys_append_to_safe_display_buf(buffer, added.c_str());
+        };
+        EXPECT_TRUE(append("") == 0 && append("abc") == 3);
         EXPECT_STREQ(csys_display_buf_text(buffer), "abc");
-        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, std::string(1000, 'x').c_str()), 0u);
+        EXPECT_EQ(append(std::string(1000, 'x')), 0u);
         EXPECT_EQ(csys_display_buf_text(buffer), "abc" + std::string(987, 'x') + "\n");
-        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "y"), 0u);
-        EXPECT_EQ(csys_display_buf_bytes_used(buffer), 991u);
+        EXPECT_TRUE(append("y") == 0 && csys_display_buf_bytes_used(buffer) == 991);
         buffer = csys_create_safe_display_buf_desc(memory.get() + offset, 1024);
-        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, std::string(991, 'x').c_str()), 991u);
+        EXPECT_EQ(append(std::string(991, 'x')), 991u);
         EXPECT_EQ(csys_display_buf_text(buffer), std::string(991, 'x')); // full, but not cut
         memory[1024 + offset - 32] ^= 1;
-        EXPECT_EQ(csys_chk_display_buf(buffer), 1);
-        EXPECT_EQ(csys_append_to_safe_display_buf(buffer, "y"), 0u);
+        EXPECT_TRUE(csys_chk_display_buf(buffer) == 1 && append("y") == 0);
     }
     char small[33];
     EXPECT_EQ(csys_create_safe_display_buf_desc(small, 32), nullptr);

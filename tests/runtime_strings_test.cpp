@@ -1,25 +1,11 @@
 // Strings, tokens and buffers.
 #include <gtest/gtest.h>
 
-#include <cstring>
-#include <string>
-#include <vector>
-
-#include "runtime/tbuffer.h"
-#include "runtime/tstr_array.h"
-#include "runtime/tstring.h"
 #include "tests/support/log_lines.h"
-#include "tests/support/owners.h"
+#include "tests/support/runtime_owners.h"
 
 namespace {
 
-using string_owner = owner<tstring, ts_free>;
-using tokens_owner = owner<tstr_array, tstr_array_free>;
-using buffer_owner = owner<tbuffer, tb_free>;
-
-std::string text(const tstring *string) {
-    return string ? std::string(string->buffer, static_cast<size_t>(string->length)) : "(null)";
-}
 // What an operation leaves: the text or the size, or the number of the failure.
 std::string left(lc_status status, const tstring *string) {
     return status == LC_OK ? text(string) : std::to_string(status);
@@ -60,25 +46,20 @@ TEST(Strings, OffsetsAndTheirLimits) {
     ASSERT_EQ(ts_new_str(&string, "abcdef"), LC_OK);
     EXPECT_EQ(left(ts_put_str(string, 2, "XY"), string), "abXYef");
     EXPECT_EQ(left(ts_put_str(string, 5, "12"), string), "abXYe12");
-    EXPECT_EQ(left(ts_copy_str(string, 1, "c"), string), "ac");
-    EXPECT_EQ(left(ts_put_char(string, 99, 'd'), string), "acd"); // past the end appends
-    EXPECT_EQ(left(ts_put_char(string, 0, 'A'), string), "Acd");
-    EXPECT_EQ(left(ts_insert_char(string, 1, 'b'), string), "Abcd");
-    EXPECT_EQ(left(ts_append(string, string), string), "AbcdAbcd"); // itself
-    EXPECT_EQ(left(ts_append_str_frag(string, "0123456", 2, 3), string), "AbcdAbcd234");
-    EXPECT_EQ(left(ts_append_str_frag(string, "0123456", 5, -1), string), "AbcdAbcd23456");
-    EXPECT_EQ(left(ts_append_sprintf(string, "-%d", 7), string), "AbcdAbcd23456-7");
-    const lc_status refused[] = {ts_insert_char(string, 16, 'x'), ts_put_str(string, 16, "x"),
-                                 ts_copy_str(string, -1, "x"), ts_append_str_frag(string, "012", 4, 1)};
-    for (const lc_status status : refused)
+    EXPECT_EQ(left(ts_put_char(string, 99, 'd'), string), "abXYe12d"); // past the end appends
+    EXPECT_EQ(left(ts_copy_str(string, 1, "cd"), string), "acd");
+    EXPECT_EQ(left(ts_insert_char(string, 1, 'b'), string), "abcd");
+    EXPECT_EQ(left(ts_append(string, string), string), "abcdabcd"); // itself
+    EXPECT_EQ(left(ts_append_str_frag(string, "0123456", 2, 3), string), "abcdabcd234");
+    EXPECT_EQ(left(ts_append_str_frag(string, "0123456", 5, -1), string), "abcdabcd23456");
+    EXPECT_EQ(left(ts_append_sprintf(string, "-%d", 7), string), "abcdabcd23456-7");
+    for (const lc_status status : {ts_insert_char(string, 16, 'x'), ts_put_str(string, 16, "x"),
+                                   ts_copy_str(string, -1, "x"), ts_append_str_frag(string, "012", 4, 1)})
         EXPECT_EQ(status, LC_NO_BUFFER_SPACE);
     EXPECT_TRUE(ts_append_char(string, 0) == LC_ASSERTION && ts_get_char(string, 15) == 0);
-    EXPECT_TRUE(ts_substr(string, 4, 4, &piece) == LC_OK && text(piece) == "Abcd");
     EXPECT_EQ(ts_substr(string, 16, 1, &piece), LC_ASSERTION);
     int32_t at = 0;
-    EXPECT_TRUE(ts_find_char(string, 1, 'A', &at) == LC_OK && at == 4);
-    EXPECT_TRUE(ts_rfind_char(string, 3, 'A', &at) == LC_OK && at == 0);
-    EXPECT_TRUE(ts_find_char(string, 0, '#', &at) == LC_OK && at == -1);
+    EXPECT_TRUE(ts_rfind_char(string, 3, 'a', &at) == LC_OK && at == 0);
     ASSERT_EQ(ts_new_str(&piece, "  a b //"), LC_OK);
     EXPECT_EQ(left(ts_trim(piece, ' ', '/'), piece), "a b ");
 }
@@ -92,9 +73,8 @@ TEST(Strings, NullsTakeoverAndOrder) {
     char *given = strdup("taken");
     EXPECT_TRUE(ts_new_str_takeover(&string, &given, -1, -1) == LC_OK && !given);
     EXPECT_EQ(ts_append_str(string, " and longer than it was"), LC_OK);
-    EXPECT_EQ(ts_detach(&string.pointer, &given, nullptr), LC_OK);
-    EXPECT_STREQ(given, "taken and longer than it was");
-    free(given);
+    EXPECT_EQ(text_of([&](char **out) { return ts_detach(&string.pointer, out, nullptr); }),
+              "taken and longer than it was");
     ASSERT_TRUE(ts_new_str(&string, "Name") == LC_OK && ts_new_str(&other, "name") == LC_OK);
     EXPECT_TRUE(ts_equal(nullptr, nullptr) && !ts_equal(string, nullptr) && !ts_equal(string, other));
     EXPECT_TRUE(ts_cmp(string, other) < 0 && ts_equal_str(string, "nAME", 1) &&
@@ -103,30 +83,26 @@ TEST(Strings, NullsTakeoverAndOrder) {
 
 // In memory of somebody else, strings and arrays of them take any operation and leave that memory alone.
 TEST(Strings, PackedInOneAllocation) {
-    static const struct {
-        lc_status (*change)(tstring *);
-        const char *left;
-    } changes[] = {
+    static const std::pair<lc_status (*)(tstring *), const char *> changes[] = {
         {[](tstring *string) { return ts_append_str(string, "cdefghijklmnopq"); }, "abcdefghijklmnopq"},
         {[](tstring *string) { return ts_copy_str(string, 1, "c"); }, "ac"},
         {[](tstring *string) { return ts_trim(string, 'a', 0); }, "b"},
         {[](tstring *string) { return ts_set_utf8(string, 1); }, "ab"},
         {ts_clear, ""},
     };
-    for (const auto &c : changes) {
+    for (const auto &[change, expected] : changes) {
         tokens_owner array;
         tstring *records = nullptr, *one = nullptr;
-        char *bytes = nullptr, *taken = nullptr;
+        char *bytes = nullptr;
         ASSERT_EQ(tstr_array_new_packed(&array, 2, 6, &records, &bytes), LC_OK);
         memcpy(bytes, "ab\0cd", 6);
         ts_place(&records[0], bytes, 2);
         ts_place(&records[1], bytes + 3, 2);
-        EXPECT_EQ(left(c.change(records), records), c.left);
+        EXPECT_EQ(left(change(records), records), expected);
         ASSERT_EQ(tstr_array_append_str(array, "more"), LC_OK); // moves the slots
         EXPECT_STREQ(tstr_array_get_str_quick(array, 1), "cd");
-        ASSERT_TRUE(tstr_array_remove(array, 0, &one) == LC_OK && ts_detach(&one, &taken, nullptr) == LC_OK);
-        EXPECT_STREQ(taken, c.left);
-        free(taken);
+        ASSERT_EQ(tstr_array_remove(array, 0, &one), LC_OK);
+        EXPECT_EQ(text_of([&](char **out) { return ts_detach(&one, out, nullptr); }), expected);
     }
 }
 
@@ -134,18 +110,15 @@ TEST(Strings, CharactersOfUtf8) {
     string_owner string, piece;
     ASSERT_EQ(ts_new_str(&string, "a\xc3\xa4z"), LC_OK); // a, a umlaut, z
     EXPECT_TRUE(ts_num_chars(string) == 4 && ts_set_utf8(string, 1) == LC_OK && ts_num_chars(string) == 3);
-    EXPECT_EQ(ts_get_char(string, 1), 0xe4u);
+    EXPECT_TRUE(ts_get_char(string, 1) == 0xe4 && ts_equal_str(string, "A\xc3\x84Z", 1));
     EXPECT_TRUE(ts_substr(string, 1, 1, &piece) == LC_OK && text(piece) == "\xc3\xa4");
-    EXPECT_TRUE(ts_equal_str(string, "A\xc3\x84Z", 1));
+    EXPECT_EQ(left(ts_put_str(string, 1, "\xe2\x82\xac"), string), "a\xe2\x82\xacz"); // one for one
     int32_t at = 0;
     EXPECT_TRUE(ts_find_char(string, 0, 'z', &at) == LC_OK && at == 2);
-    EXPECT_EQ(left(ts_put_str(string, 1, "\xe2\x82\xac"), string), "a\xe2\x82\xacz"); // one for one
-    EXPECT_EQ(left(ts_append_str_frag_utf8(string, "\xc3\xa4\xc3\xb6\xc3\xbc", 1, 1), string),
-              "a\xe2\x82\xacz\xc3\xb6");
     log_lines log;
     EXPECT_EQ(ts_append_str(string, "b\xff"), LC_BAD_UTF8);
     EXPECT_TRUE(log.say("98 *** 255 ***"));
-    EXPECT_EQ(ts_num_chars(string), 4);
+    EXPECT_EQ(ts_num_chars(string), 3);
 }
 
 // --- Tokens
@@ -155,8 +128,8 @@ std::string tokens(const char *given, char separator, char escape, char quote, u
     if (ts_tokenize_str(given, separator, escape, quote, flags, &array) != LC_OK)
         return "(failed)";
     std::string all = array.pointer ? "" : "(null)";
-    for (uint32_t i = 0; i < tstr_array_length_quick(array); i++)
-        all += "[" + text(tstr_array_get_quick(array, i)) + "]";
+    for (const std::string &token : list_of(array))
+        all += "[" + token + "]";
     return all;
 }
 std::string joined(const std::vector<const char *> &parts, char separator, char escape, uint32_t flags) {
@@ -207,7 +180,7 @@ TEST(Buffers, SizesGapsAndLimits) {
 
     ASSERT_EQ(tb_new(&buffer), LC_OK);
     EXPECT_EQ(tb_put_buf(buffer, 10, "ab", 2), LC_OK);
-    EXPECT_EQ(std::string(reinterpret_cast<char *>(tb_buf(buffer)), 12), std::string(10, '\0') + "ab");
+    EXPECT_EQ(bytes_of(buffer), std::string(10, '\0') + "ab");
     EXPECT_EQ(tb_delete_bytes(buffer, 0, 10), LC_OK);
     EXPECT_STREQ(reinterpret_cast<char *>(tb_buf(buffer)), "ab");
     for (const uint32_t offset : {1u, 0xffffffffu})
@@ -218,7 +191,7 @@ TEST(Buffers, SizesGapsAndLimits) {
     uint32_t number = 7;
     EXPECT_TRUE(tb_get_uint32(buffer, 124, &number) == LC_OK && number == 0);
     for (const uint32_t offset : {125u, 0xfffffffeu})
-        EXPECT_EQ(tb_get_uint32(buffer, offset, &number), LC_ASSERTION);
+        EXPECT_EQ(tb_get_uint32(buffer, offset, &number), LC_ASSERTION) << offset;
     ASSERT_EQ(tb_new_buf_const(&constant, "fixed", 5), LC_OK);
     EXPECT_TRUE(tb_append_uint8(constant, 1) == LC_ASSERTION && tb_clear(constant) == LC_ASSERTION);
 }

@@ -1,17 +1,14 @@
 // The log with a syslog daemon that reads, is stopped, ends and is started again, or does not exist; threads
 // that are cancelled while they log, and a process that forks meanwhile.
-#include "runtime/logging.h"
-
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <cerrno>
-#include <memory>
 #include <thread>
 
 #include <pthread.h>
 #include <sys/wait.h>
 
+#include "runtime/logging.h"
 #include "runtime/ttime.h"
 #include "tests/support/log_daemon.h"
 
@@ -38,46 +35,43 @@ constexpr int FLOOD = 1000;
 constexpr int64_t COST_MS = 500;
 
 struct Syslog : testing::TestWithParam<int> {
-    std::unique_ptr<log_daemon> daemon;
+    log_daemon daemon{GetParam()};
     void SetUp() override {
-        daemon = std::make_unique<log_daemon>(GetParam());
         ASSERT_EQ(lc_log_init("wccpd", nullptr, 0, 0x1060000, 7, 136, 1), LC_OK);
         ASSERT_EQ(lc_log_set_daemon_log_level(7), LC_OK);
         log_numbered(-1, 0); // reports the lost lines of an earlier case
-        (void)daemon->take();
+        (void)daemon.take();
     }
     void TearDown() override { (void)lc_log_close(); }
-};
-INSTANTIATE_TEST_SUITE_P(Sockets, Syslog, testing::Values(SOCK_DGRAM, SOCK_STREAM),
-                         [](const auto &kind) { return kind.param == SOCK_DGRAM ? "datagram" : "stream"; });
-
-// Logs 500 lines while another thread reads, with a pause after each line. On a busy machine the reader may
-// be held up as well, so there are three attempts.
-void expect_burst(log_daemon *daemon, useconds_t rest_us) {
-    std::vector<std::string> lines;
-    for (int attempt = 0; attempt < 3 && lines.size() != 500; attempt++) {
-        (void)daemon->take();
-        log_numbered(-1, 0); // reports the lost lines of the last attempt
-        (void)daemon->take();
-        lines.clear();
-        std::thread reader([&] {
-            while (lines.size() < 500) {
-                const std::vector<std::string> more = daemon->take(500, 1);
-                if (more.empty())
-                    return;
-                lines.insert(lines.end(), more.begin(), more.end()); // a stream returns several at once
-                usleep(lines.size() % 100 ? rest_us : rest_us * 50);
-            }
-        });
-        log_numbered(0, 500);
-        reader.join();
+    // Logs 500 lines while another thread reads, with a pause after each line. On a busy machine the reader
+    // may be held up as well, so there are three attempts.
+    void expect_burst(useconds_t rest_us) {
+        std::vector<std::string> lines;
+        for (int attempt = 0; attempt < 3 && lines.size() != 500; attempt++) {
+            (void)daemon.take();
+            log_numbered(-1, 0); // reports the lost lines of the last attempt
+            (void)daemon.take();
+            lines.clear();
+            std::thread reader([&] {
+                while (lines.size() < 500) {
+                    const std::vector<std::string> more = daemon.take(500, 1);
+                    if (more.empty())
+                        return;
+                    lines.insert(lines.end(), more.begin(), more.end()); // a stream returns several at once
+                    usleep(lines.size() % 100 ? rest_us : rest_us * 50);
+                }
+            });
+            log_numbered(0, 500);
+            reader.join();
+        }
+        expect_lines(lines, 0, 0, 500);
     }
-    expect_lines(lines, 0, 0, 500);
-}
+};
+INSTANTIATE_TEST_SUITE_P(Sockets, Syslog, testing::Values(SOCK_DGRAM, SOCK_STREAM));
 
 TEST_P(Syslog, ABurstArrivesWholeAndInOrder) {
-    for (const useconds_t rest_us : {0u, 100u})
-        expect_burst(daemon.get(), rest_us);
+    expect_burst(0);
+    expect_burst(100);
 }
 
 TEST_P(Syslog, AStoppedReaderCostsMillisecondsAndIsReported) {
@@ -85,19 +79,19 @@ TEST_P(Syslog, AStoppedReaderCostsMillisecondsAndIsReported) {
     errno = EAGAIN; // as after a read from an empty socket
     log_numbered(0, FLOOD);
     EXPECT_LT(lt_monotonic_ms() - began, COST_MS);
-    std::vector<std::string> lines = daemon->take();
+    std::vector<std::string> lines = daemon.take();
     const int got = static_cast<int>(lines.size());
     ASSERT_LT(got, FLOOD);
     expect_lines(lines, 0, 0, got);
 
     log_numbered(FLOOD, FLOOD + 1);
-    lines = daemon->take();
+    lines = daemon.take();
     ASSERT_EQ(lines.size(), 2u);
     EXPECT_EQ(number_in(lines[0], "messages lost due to non-blocking syslog (count="), FLOOD - got);
     EXPECT_TRUE(lines[0].starts_with("<139>") && lines[0].ends_with(')')); // no newline
     EXPECT_EQ(lines[0].find("TID"), std::string::npos);
     expect_lines(lines, 1, FLOOD, FLOOD + 1);
-    expect_burst(daemon.get(), 0); // reported once; the patience has been restored
+    expect_burst(0); // reported once; the patience has been restored
 }
 
 TEST_P(Syslog, ThreadsShareOnePatience) {
@@ -110,7 +104,7 @@ TEST_P(Syslog, ThreadsShareOnePatience) {
     EXPECT_LT(lt_monotonic_ms() - began, COST_MS);
     int sum = 0;
     for (int round = 0; round < 2; round++) {
-        for (const std::string &line : daemon->take())
+        for (const std::string &line : daemon.take())
             sum += std::max(number_in(line, "(count="), 0) + (number_in(line, "line ") >= 0);
         QV_LOG(LC_LOG_NOTICE, "the last");
     }
@@ -118,17 +112,17 @@ TEST_P(Syslog, ThreadsShareOnePatience) {
 }
 
 TEST_P(Syslog, ADaemonThatIsRestartedIsFound) {
-    daemon->stop();
+    daemon.stop();
     const int64_t began = lt_monotonic_ms();
     log_numbered(0, 5000); // lost silently and cheaply
     EXPECT_LT(lt_monotonic_ms() - began, 2000);
-    daemon->start();
+    daemon.start();
     log_numbered(6, 9);
-    expect_lines(daemon->take(), 0, 6, 9);
-    daemon->stop();
-    daemon->start(); // between two lines
+    expect_lines(daemon.take(), 0, 6, 9);
+    daemon.stop();
+    daemon.start(); // between two lines
     log_numbered(9, 12);
-    expect_lines(daemon->take(), 0, 9, 12);
+    expect_lines(daemon.take(), 0, 9, 12);
 
     log_numbered(0, FLOOD);
     log_daemon successor; // the old one is stopped and still has its socket
@@ -151,7 +145,7 @@ TEST_P(Syslog, ACancelledThreadFinishesItsLines) {
         }).join();
     }
     EXPECT_EQ(finished, 50);
-    std::vector<std::string> lines = daemon->take();
+    std::vector<std::string> lines = daemon.take();
     ASSERT_FALSE(lines.empty());
     expect_lines(lines, 0, 0, GetParam() == SOCK_STREAM ? 50 : static_cast<int>(lines.size()));
 }
@@ -165,7 +159,7 @@ TEST_P(Syslog, AForkedChildCanLog) {
     });
     std::thread reader([&] {
         while (!stop)
-            for (const std::string &line : daemon->take(5, 50))
+            for (const std::string &line : daemon.take(5, 50))
                 from_children += line.find("a child") != std::string::npos;
     });
     for (int round = 0; round < 30; round++) {
