@@ -1,17 +1,12 @@
 // The platform's files: bad lines don't affect good ones; a file is written completely or not at all.
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
-#include <cerrno>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
-#include <string>
 
 #include "platform/file_utils.h"
 #include "platform/limits.h"
@@ -25,9 +20,8 @@ void write_text(const fs::path &path, const std::string &text) {
 }
 
 std::string text_of(const fs::path &path) {
-    std::stringstream text;
-    text << std::ifstream(path, std::ios::binary).rdbuf();
-    return text.str();
+    std::ifstream file(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(file), {}};
 }
 
 mode_t mode_of(const fs::path &path) {
@@ -41,7 +35,9 @@ size_t names_in(const fs::path &directory) {
 }
 
 struct Files : testing::Test {
-    Files() : dir("/tmp/files"), umask_before(umask(077)) {
+    const fs::path dir = "/tmp/files";
+    const mode_t umask_before = umask(077);
+    Files() {
         fs::remove_all(dir);
         fs::create_directory(dir);
     }
@@ -53,45 +49,43 @@ struct Files : testing::Test {
         errno = 0;
         return lf_write_file(path.c_str(), mode, text.data(), overwrite, static_cast<uint32_t>(text.size()));
     }
-    fs::path dir;
-    mode_t umask_before;
 };
 
 } // namespace
 
 TEST_F(Files, LimitsComeFromTheGoodLines) {
-    const struct {
-        std::string text;
-        uint32_t tunnels, interfaces;
-    } cases[] = {
-        {"", 200, 128},
-        {"max_user_tunnels 17\nmax_interfaces 4\n", 17, 4},
-        {"# max_user_tunnels 5\n\n   \n\tmax_interfaces\t 127  ", 200, 127},
-        {"max_user_tunnels 0\nmax_interfaces 65535", 0, 65535},
-        {"max_user_tunnels 65000\r\nmax_interfaces 1\r\n", 65000, 1},
+    using numbers = std::pair<uint32_t, uint32_t>; // of tunnels and interfaces
+    const auto limits_in = [](const fs::path &path) {
+        const platform_limits limits = platform_limits_read(path.c_str());
+        return numbers{limits.max_user_tunnels, limits.max_interfaces};
+    };
+    const std::pair<std::string, numbers> cases[] = {
+        {"", {200, 128}},
+        {"", {200, 128}},
+        {"max_user_tunnels 17\nmax_interfaces 4\n", {17, 4}},
+        {"# max_user_tunnels 5\n\n   \n\tmax_interfaces\t 127  ", {200, 127}},
+        {"max_user_tunnels 0\nmax_interfaces 65535", {0, 65535}},
+        {"max_user_tunnels 65000\r\nmax_interfaces 1\r\n", {65000, 1}},
         // bad lines, each with a good one
-        {"max_user_tunnels 65001\nmax_interfaces 9", 200, 9},
-        {"max_interfaces 0\nmax_user_tunnels 3", 3, 128},
+        {"max_user_tunnels 65001\nmax_interfaces 9", {200, 9}},
+        {"max_interfaces 0\nmax_user_tunnels 3", {3, 128}},
         {"max_interfaces -1\nmax_interfaces +4\nmax_interfaces 0x10\nmax_interfaces 12 13\nmax_interfaces\n"
          "max_interfaces \nmax_interfaces twelve\nmax_interfaces 4294967424\nmax_interfaces "
          "99999999999999999999999\nmax_interfacesx 3\nMAX_INTERFACES 3\nmax_interface 3\nmax_user_tunnels 8",
-         8, 128},
+         {8, 128}},
         // A line that is too long is one bad line, not several; a NUL does not hide what follows it.
-        {"max_interfaces 5" + std::string(5000, ' ') + "\nmax_user_tunnels 6\n", 6, 128},
-        {std::string(126, '#') + "\nmax_user_tunnels 6\na" + '\0' + "b\nmax_interfaces 7\n", 6, 7},
+        {"max_interfaces 5" + std::string(5000, ' ') + "\nmax_user_tunnels 6\n", {6, 128}},
+        {std::string(126, '#') + "\nmax_user_tunnels 6\na" + '\0' + "b\nmax_interfaces 7\n", {6, 7}},
     };
-    for (const auto &row : cases) {
-        write_text(dir / "conf", row.text);
-        const platform_limits limits = platform_limits_read((dir / "conf").c_str());
-        EXPECT_EQ(limits.max_user_tunnels, row.tunnels) << row.text;
-        EXPECT_EQ(limits.max_interfaces, row.interfaces) << row.text;
+    for (const auto &[text, expected] : cases) {
+        write_text(dir / "conf", text);
+        EXPECT_EQ(limits_in(dir / "conf"), expected) << text;
     }
-    EXPECT_EQ(platform_limits_read((dir / "none").c_str()).max_interfaces, 128u);
-    EXPECT_EQ(platform_limits_read(dir.c_str()).max_interfaces, 128u);
-    // The file that is shipped has the defaults.
-    const platform_limits shipped = platform_limits_read(WCCP_SOURCE_DIR "/packaging/platform.conf");
-    EXPECT_TRUE(shipped.max_user_tunnels == 200 && shipped.max_interfaces == 128);
-    EXPECT_TRUE(fs::exists(WCCP_SOURCE_DIR "/packaging/platform.conf"));
+    const numbers defaults = {200, 128};
+    EXPECT_EQ(limits_in(dir / "none"), defaults);
+    EXPECT_EQ(limits_in(dir), defaults);
+    const char *shipped = WCCP_SOURCE_DIR "/packaging/platform.conf";
+    EXPECT_TRUE(fs::exists(shipped) && limits_in(shipped) == defaults);
     // They are read once.
     fs::create_directories(fs::path(PLATFORM_CONF_PATH).parent_path());
     write_text(PLATFORM_CONF_PATH, "max_user_tunnels 30\n");
@@ -123,8 +117,8 @@ TEST_F(Files, MissingDirectoriesAreCreatedWithTheMode) {
 
 TEST_F(Files, AFileHasExactlyTheBytesAndTheMode) {
     const fs::path path = dir / "file";
-    for (const auto &[text, mode] : std::vector<std::pair<std::string, mode_t>>{
-             {std::string("a\0b\n", 4), 0644}, {"9", 0600}, {"", 0600}}) {
+    const std::pair<std::string, mode_t> files[] = {{{"a\0b\n", 4}, 0644}, {"9", 0600}, {"", 0600}};
+    for (const auto &[text, mode] : files) {
         EXPECT_EQ(write(path, text, 1, mode), LC_OK);
         EXPECT_EQ(text_of(path), text);
         EXPECT_EQ(mode_of(path), mode) << "regardless of the umask";
@@ -145,11 +139,9 @@ TEST_F(Files, OnlyPlainFilesAreReplaced) {
     fs::create_hard_link(dir / "target", dir / "second");
     fs::create_directory(dir / "directory");
     ASSERT_EQ(mkfifo((dir / "pipe").c_str(), 0600), 0);
-    for (const auto &[name, reason] : std::vector<std::pair<const char *, int>>{{"link", ELOOP},
-                                                                                {"dangling", ELOOP},
-                                                                                {"second", EMLINK},
-                                                                                {"directory", EISDIR},
-                                                                                {"pipe", EINVAL}}) {
+    const std::pair<const char *, int> refused[] = {
+        {"link", ELOOP}, {"dangling", ELOOP}, {"second", EMLINK}, {"directory", EISDIR}, {"pipe", EINVAL}};
+    for (const auto &[name, reason] : refused) {
         EXPECT_EQ(write(dir / name, "new"), LC_BAD_FILE) << name;
         EXPECT_EQ(errno, reason) << name;
     }
