@@ -240,14 +240,18 @@ TEST(Attributes, Order) {
 }
 
 TEST(Bindings, TypedOperations) {
-    binding_owner binding, bare;
+    binding_owner binding, bare, address;
     uint32_t type = 9, value = 42;
+    uint64_t first = 0, last = 0;
     ASSERT_EQ(bn_binding_new_uint32(&binding, "/a", 1, bn_flag_display | 7, 5), LC_OK);
     EXPECT_EQ(bn_binding_get_uint32(binding, 1, &type, &value), LC_OK);
     EXPECT_TRUE(value == 5 && type == (bn_type_uint32 | bn_flag_display));
     EXPECT_EQ(bn_binding_get_uint32(binding, 0, &type, &value), LC_OK); // an empty slot
     EXPECT_TRUE(value == 5 && type == 0);
     EXPECT_EQ(bn_binding_set_int8(binding, 1, 0, -1), LC_OK);
+    ASSERT_EQ(bn_binding_new_ipv6addr(&address, "/b", 1, 0, 1, 2), LC_OK);
+    EXPECT_EQ(bn_binding_get_ipv6addr(address, 1, nullptr, &first, &last), LC_OK);
+    EXPECT_TRUE(first == 1 && last == 2);
     ASSERT_EQ(bn_binding_new_named(&bare, "/c"), LC_OK);
     log_lines log;
     char *given = nullptr;
