@@ -4,9 +4,6 @@
 
 #include <algorithm>
 #include <array>
-#include <cstdlib>
-#include <memory>
-#include <sstream>
 
 #include "engine/wccp_mask_assignment.h"
 #include "engine/wccp_slot_owners.h"
@@ -42,19 +39,14 @@ std::string runs_of(const be32 *table, uint32_t slots) {
         if (i + 1 < slots && table[i + 1] == table[i])
             continue;
         const uint32_t third = table[i].bytes[2], fourth = table[i].bytes[3];
-        text << (i + 1 == length ? "" : " ") << (third ? std::to_string(third) + "." : "") << fourth << ":"
-             << length;
+        text << " " << (third ? std::to_string(third) + "." : "") << fourth << ":" << length;
         length = 0;
     }
-    return text.str();
+    return text.str().substr(std::min<size_t>(1, text.str().size()));
 }
 
 TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
-    static const struct {
-        const char *entries;
-        uint32_t slots;
-        const char *runs;
-    } cases[] = {
+    static const std::tuple<const char *, uint32_t, const char *> cases[] = {
         // In proportion; remainders are passed on.
         {"1:100 2:100 3:100", 256, "1:85 2:85 3:86"},
         {"1:1 2:2", 256, "1:85 2:171"},
@@ -84,14 +76,13 @@ TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
         // glibc's qsort, which merges the first into the sorted pair of the others.
         {"1:1 100:1 200:2", 256, "1:64 100:64 200:128"},
         {"200:2 100:1 1:1", 256, "200:128 1:64 100:64"},
-        {"100:1 1:1 200:2", 256, "100:64 200:128 1:64"},
-    };
-    for (const auto &c : cases) {
-        entries list = parse(c.entries);
-        std::vector<be32> table(c.slots, host(77));
-        wccp_compute_assignment_table(static_cast<uint32_t>(list.size()), list.data(), c.slots, table.data(),
+        {"100:1 1:1 200:2", 256, "100:64 200:128 1:64"}};
+    for (const auto &[given, slots, runs] : cases) {
+        entries list = parse(given);
+        std::vector<be32> table(slots, host(77));
+        wccp_compute_assignment_table(static_cast<uint32_t>(list.size()), list.data(), slots, table.data(),
                                       0);
-        EXPECT_EQ(runs_of(table.data(), c.slots), c.runs) << c.entries;
+        EXPECT_EQ(runs_of(table.data(), slots), runs) << given;
     }
 }
 
@@ -115,8 +106,7 @@ struct AssignmentTest : testing::Test {
     void compute(const entries &appliances) {
         wccp_designated_appliance_assignment_start(group.get());
         for (const wccp_dsg_appliance &each : appliances) {
-            const wccp_view_appliance reported = {nullptr,     nullptr, each.ipa,
-                                                  each.weight, 1,       WCCP_LISTED_BY_ALL};
+            const wccp_view_appliance reported = {{}, {}, each.ipa, each.weight, 1, WCCP_LISTED_BY_ALL};
             wccp_designated_appliance_assignment_add(group.get(), &reported);
             ASSERT_LE(group->dsg_appliance_count, WCCP_MAX_APPLIANCES);
             ASSERT_EQ(group->bucket_count, 0u); // directly after the entries in memory
@@ -152,10 +142,9 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
         entries appliances, staying;
         uint32_t weight = 0;
         for (uint32_t i = 0, count = 1 + random(32); i < count; i++) {
-            const uint32_t kind = random(4), any = random(65536);
-            appliances.push_back(entry(random(256) << 8 | (i * 8 + random(8)), kind == 0   ? 0
-                                                                               : kind == 1 ? 65535
-                                                                                           : any));
+            const uint32_t weights[] = {0, 65535, random(65536)};
+            appliances.push_back(
+                entry(random(256) << 8 | (i * 8 + random(8)), weights[std::min(random(4), 2u)]));
             if (i == 0 || random(3)) {
                 staying.push_back(appliances.back());
                 weight += appliances.back().weight;
@@ -167,8 +156,7 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
         compute(appliances);
         ASSERT_EQ(memcmp(whole.data(), group->bucket_ipa, sizeof group->bucket_ipa), 0);
         compute(staying);
-        ASSERT_EQ(assigned_in_all(), group->bucket_count);
-        ASSERT_EQ(group->dsg_active_count, staying.size());
+        ASSERT_TRUE(assigned_in_all() == group->bucket_count && group->dsg_active_count == staying.size());
         for (uint32_t slot = 0; weight != 0 && slot < group->bucket_count; slot++)
             if (is_active(whole[slot])) {
                 ASSERT_EQ(group->bucket_ipa[slot], whole[slot]);
@@ -179,41 +167,33 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
 TEST_F(AssignmentTest, AnApplianceThatLeavesIsDownForOneComputation) {
     group->assign_method = WCCP_ASSIGN_NONE;
     compute(parse("3:100 1:100 2:100"));
-    EXPECT_EQ(group->bucket_count, 0u); // no method agreed
-    EXPECT_TRUE(is_zero(group->bucket_ipa[0]));
+    EXPECT_TRUE(group->bucket_count == 0 && is_zero(group->bucket_ipa[0])); // no method agreed
     EXPECT_EQ(group->dsg_active_count, 3u);
 
     group->assign_method = WCCP_ASSIGN_HASH;
     compute(parse("3:100 1:100 2:100"));
     // Entries are in order of arrival, runs in sorted order.
     EXPECT_EQ(group->dsg_appliances[0].ipa, host(3));
-    EXPECT_EQ(group->bucket_index[0], 1);
-    EXPECT_EQ(group->bucket_index[85], 2);
-    EXPECT_EQ(group->bucket_index[255], 0);
-    EXPECT_EQ(group->dsg_appliances[0].assigned, 86);
-    EXPECT_EQ(group->dsg_appliances[1].assigned, 85);
+    EXPECT_EQ(std::tuple(group->bucket_index[0], group->bucket_index[85], group->bucket_index[255],
+                         group->dsg_appliances[0].assigned, group->dsg_appliances[1].assigned),
+              std::tuple(1, 2, 0, 86, 85));
 
-    const struct {
-        const char *appliances, *runs;
-        uint16_t of_3;
-    } rounds[] = {{"1:100 3:100", "1:127 3:129", 129},
-                  {"1:100 3:100", "1:128 3:128", 128},
-                  {"1:300 3:100", "1:192 3:64", 64}}; // a new weight
-    for (const auto &round : rounds) {
-        compute(parse(round.appliances));
-        EXPECT_EQ(runs(), round.runs);
-        EXPECT_EQ(group->dsg_appliance_count, 2u);
-        EXPECT_EQ(group->dsg_active_count, 2u);
-        EXPECT_EQ(group->dsg_appliances[0].ipa, host(3));
-        EXPECT_EQ(group->dsg_appliances[0].assigned, round.of_3);
-        EXPECT_EQ(group->dsg_appliances[1].ipa, host(1));
-        EXPECT_TRUE(is_zero(group->dsg_appliances[2].ipa));
-        EXPECT_EQ(group->bucket_index[0], 1);
+    const std::tuple<const char *, const char *, uint16_t> rounds[] = {
+        {"1:100 3:100", "1:127 3:129", 129},
+        {"1:100 3:100", "1:128 3:128", 128},
+        {"1:300 3:100", "1:192 3:64", 64}}; // a new weight
+    for (const auto &[appliances, slots, of_3] : rounds) {
+        compute(parse(appliances));
+        EXPECT_EQ(runs(), slots);
+        EXPECT_EQ(std::tuple(group->dsg_appliance_count, group->dsg_active_count, group->bucket_index[0],
+                             group->dsg_appliances[0].assigned),
+                  std::tuple(2, 2, 1, of_3));
+        for (const auto &[at, ipa] : {std::pair{0, host(3)}, {1, host(1)}, {2, be32{}}})
+            EXPECT_EQ(group->dsg_appliances[at].ipa, ipa);
     }
     compute({});
     EXPECT_EQ(group->dsg_appliance_count + group->bucket_count, 0u);
-    EXPECT_TRUE(is_zero(group->bucket_ipa[17]));
-    EXPECT_TRUE(is_zero(group->dsg_appliances[0].ipa));
+    EXPECT_TRUE(is_zero(group->bucket_ipa[17]) && is_zero(group->dsg_appliances[0].ipa));
 }
 
 TEST_F(AssignmentTest, DownEntriesAreDroppedWhenThereIsNoRoom) {
@@ -237,8 +217,7 @@ TEST_F(AssignmentTest, DownEntriesAreDroppedWhenThereIsNoRoom) {
     EXPECT_EQ(runs().substr(0, 4), "51:8");
     second.push_back(entry(99, 100)); // more than possible: the last one is left out
     compute(second);
-    EXPECT_EQ(group->dsg_active_count, 32u);
-    EXPECT_FALSE(is_active(host(99)));
+    EXPECT_TRUE(group->dsg_active_count == 32 && !is_active(host(99)));
 
     // 5 and 6 leave and 40 is new. 6 keeps its place for this computation, so its 8 slots are split among all
     // others; if 5, the lightest, kept its place, there would be one slot to split.
@@ -296,10 +275,8 @@ TEST_F(MaskTest, SevenBitsAreUsedAndEightReplaced) {
     EXPECT_EQ(seven.back(), (value{0, 0x1741, 0, 1}));
 
     const list eight = values_of({0, 0x1741, 2, 1});
-    EXPECT_EQ(group->mask_bits, 8u);
-    EXPECT_EQ(group->mask_value_bits, 4u);
-    EXPECT_EQ(group->mask_src_port, 2);
-    EXPECT_EQ(group->mask_dst_ip, 0x1741u);
+    EXPECT_EQ((value{group->mask_bits, group->mask_value_bits, group->mask_src_port, group->mask_dst_ip}),
+              (value{8, 4, 2, 0x1741}));
     ASSERT_EQ(eight.size(), 16u);
     for (uint32_t i = 0; i < 16; i++)
         EXPECT_EQ(eight[i], (value{0, i << 8, 0, 0}));
@@ -312,8 +289,7 @@ TEST_F(MaskTest, ValuesAreSharedLikeBuckets) {
     EXPECT_EQ(runs(), "1:5 2:5 3:6");
     for (uint32_t i = 0; i < 16; i++)
         EXPECT_EQ(group->mask_values[i].appliance_ipa, group->bucket_ipa[i]);
-    EXPECT_EQ(group->dsg_appliances[0].assigned, 6);
-    EXPECT_EQ(group->dsg_appliances[2].assigned, 5);
+    EXPECT_TRUE(group->dsg_appliances[0].assigned == 6 && group->dsg_appliances[2].assigned == 5);
 
     group->bucket_count = 17;
     EXPECT_EQ(wccp_mask_assignment_assign_mask_values(group.get()), 1);

@@ -20,20 +20,17 @@ void tables_agree() {
         }
     for (wccp_service_group **link = &wccp_g.group_list; *link; link = &(*link)->next) {
         listed++;
-        EXPECT_EQ((*link)->prev_link, link);
-        EXPECT_EQ(wccp_g.groups[(*link)->id], *link);
+        EXPECT_TRUE((*link)->prev_link == link && wccp_g.groups[(*link)->id] == *link);
     }
     for (uint32_t i = 0; i < wccp_g.if_count; i++)
         for (wccp_service_group **link = &wccp_g.interfaces[i].groups; *link; link = &(*link)->if_next) {
             on_interfaces++;
-            EXPECT_EQ((*link)->if_prev_link, link);
-            EXPECT_EQ((*link)->interfaces[0], &wccp_g.interfaces[i]);
+            EXPECT_TRUE((*link)->if_prev_link == link && (*link)->interfaces[0] == &wccp_g.interfaces[i]);
         }
     EXPECT_TRUE(slots == wccp_g.group_count && listed == slots && on_interfaces == slots);
 }
 
-class Config : public testing::Test {
-protected:
+struct Config : testing::Test {
     void SetUp() override { engine.router_socket("10.0.0.2"); }
     void TearDown() override { tables_agree(); }
 
@@ -55,31 +52,25 @@ protected:
         group->sending_router_count++;
         return record;
     }
-    static void make_active(wccp_service_group *group) {
-        group->state_flags = (group->state_flags & ~WCCP_STATE_MASK) | WCCP_STATE_ACTIVE;
-    }
     engine_fixture engine;
 };
 
 TEST_F(Config, TheFirstMulticastAddressEndsTheRouterList) {
-    const struct {
-        std::vector<std::string> given;
-        size_t unicast; // the number of unicast routers, from the first
-        const char *multicast;
-    } cases[] = {
+    // The number of unicast routers, from the first.
+    const std::tuple<std::vector<std::string>, size_t, const char *> cases[] = {
         {{"10.0.0.1", "224.0.0.5", "10.0.0.2"}, 1, "224.0.0.5"},
         {{"239.255.255.255", "10.0.0.1"}, 0, "239.255.255.255"},
-        {{"223.255.255.255", "240.0.0.1", "10.0.0.3"}, 3, nullptr},
-        {{}, 0, nullptr},
+        {{"223.255.255.255", "240.0.0.1", "10.0.0.3"}, 3, "0.0.0.0"},
+        {{}, 0, "0.0.0.0"},
     };
     uint8_t id = 0;
-    for (const auto &one : cases) {
-        const wccp_service_group *group = add(engine_fixture::group_config(id++, one.given));
-        ASSERT_EQ(group->ucast_router_count, one.unicast);
-        for (size_t i = 0; i < one.unicast; i++)
-            EXPECT_EQ(group->ucast_routers[i], ipa(one.given[i]));
-        EXPECT_EQ(group->mcast_configured, one.multicast ? 1u : 0u);
-        EXPECT_EQ(group->mcast_ipa, one.multicast ? ipa(one.multicast) : be32{});
+    for (const auto &[given, unicast, multicast] : cases) {
+        const wccp_service_group *group = add(engine_fixture::group_config(id++, given));
+        ASSERT_EQ(group->ucast_router_count, unicast);
+        for (size_t i = 0; i < unicast; i++)
+            EXPECT_EQ(group->ucast_routers[i], ipa(given[i]));
+        EXPECT_EQ(group->mcast_ipa, ipa(multicast));
+        EXPECT_EQ(group->mcast_configured, !is_zero(group->mcast_ipa));
     }
     wccp_grp_config full = config(id);
     full.router_count = 65535; // more than there is room for
@@ -101,19 +92,16 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
               (numbers{0x9, 7, 1, WCCP_STATE_INIT, 1, 10, 5}));
     EXPECT_EQ(memcmp(group->password, "12345678", 8), 0);
     EXPECT_EQ(group->appliance_ipa, ipa("10.0.0.100"));
-    EXPECT_EQ(wccp_find_group(61 + 256), group);
 
     wccp_grp_config other = config(62);
     other.compatibility = WCCP_COMPAT_NEXUS;
-    EXPECT_EQ(add(other)->security_option, 0u);
-    EXPECT_EQ(wccp_g.group_list->id, 62) << "newest first";
-    EXPECT_EQ(wccp_find_group(62)->compat_mode, 2u);
+    const wccp_service_group *second = add(other);
+    EXPECT_TRUE(second->security_option == 0 && second->compat_mode == 2);
+    EXPECT_EQ(wccp_g.group_list, second) << "newest first";
 
     // A group that cannot be added changes nothing.
-    EXPECT_EQ(wccp_add_group(nullptr), 1);
-    EXPECT_EQ(wccp_add_group(&with), 1);
-    EXPECT_EQ(wccp_find_group(61), group);
-    EXPECT_EQ(wccp_del_group(60), 1);
+    EXPECT_EQ(wccp_add_group(nullptr) + wccp_add_group(&with) + wccp_del_group(60), 3);
+    EXPECT_TRUE(wccp_find_group(61) == group && wccp_find_group(61 + 256) == group);
     memset(other.interface, 'x', sizeof other.interface); // not terminated
     other.group_id = 63;
     EXPECT_STREQ(add(other)->interfaces[0]->name, "xxxxxxxxxxxxxxx");
@@ -122,8 +110,9 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
 TEST_F(Config, AGroupStartsAsFarAsItCan) {
     // Enabled, on an interface that is not ready: only the connectivity alarm runs.
     const wccp_service_group *waiting = add(config(10, "absent0"));
-    EXPECT_EQ(waiting->hia_timer.active + waiting->monitor_timer.active, 0);
-    EXPECT_EQ(waiting->router_alarm_timer.active, 1);
+    EXPECT_EQ(std::tuple(waiting->hia_timer.active, waiting->monitor_timer.active,
+                         waiting->router_alarm_timer.active),
+              std::tuple(0, 0, 1));
     // Disabled, or not configured: no timer runs.
     for (const uint32_t admin : {WCCP_ADMIN_DOWN + 0u, 0u}) {
         wccp_grp_config with = config(static_cast<uint8_t>(11 + admin));
@@ -136,19 +125,15 @@ TEST_F(Config, AGroupStartsAsFarAsItCan) {
 
 TEST_F(Config, DisablingStopsOnceAndEnablingStartsOnce) {
     wccp_service_group *group = add(config(61));
-    const struct {
-        uint32_t admin;
-        bool changes;
-        uint32_t state;
-    } steps[] = {{1, false, 1}, {7, true, 2}, {2, false, 2}, {1, true, 1}};
-    for (const auto &step : steps) {
+    const std::tuple<uint32_t, bool, uint32_t> steps[] = {
+        {1, false, 1}, {7, true, 2}, {2, false, 2}, {1, true, 1}};
+    for (const auto &[admin, changes, state] : steps) {
         wccp_grp_config update = {};
-        update.admin = step.admin;
+        update.admin = admin;
         group->change_number = 5;
         EXPECT_EQ(modify(61, WCCP_CFG_ADMIN, update), 0);
-        EXPECT_EQ(group->admin_state, step.state);
-        EXPECT_EQ(group->change_number, step.changes ? 0u : 5u);
-        EXPECT_EQ(group->hia_timer.active, step.state == 1 ? 1 : 0);
+        EXPECT_EQ(std::tuple(group->admin_state, group->change_number, group->hia_timer.active),
+                  std::tuple(state, changes ? 0 : 5, state == 1));
         EXPECT_EQ(modify(99, WCCP_CFG_ADMIN, update), 0) << "a missing group is not a failure here";
     }
 }
@@ -163,30 +148,27 @@ TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
     fill.mask_dst_port = 0x1f;
     memcpy(fill.password, "secret", 6);
     const wccp_service_group *group = add(config(61));
-    const struct {
-        uint32_t flags;
-        uint32_t weight, service_flags, mask_bits; // afterwards
-        const char *refusal = "";
-    } rows[] = {
-        {WCCP_CFG_ADMIN | WCCP_CFG_WEIGHT, 100, 0, 0}, // of several, the first in order acts
-        {WCCP_CFG_WEIGHT | WCCP_CFG_COMPATIBILITY, 7, 0, 0},
+    // Afterwards: weight, service flags, mask bits; and the refusal.
+    const std::tuple<uint32_t, uint32_t, uint32_t, uint32_t, const char *> rows[] = {
+        {WCCP_CFG_ADMIN | WCCP_CFG_WEIGHT, 100, 0, 0, ""}, // of several, the first in order acts
+        {WCCP_CFG_WEIGHT | WCCP_CFG_COMPATIBILITY, 7, 0, 0, ""},
         {WCCP_CFG_HASH_SRC_IP | WCCP_CFG_HASH_DST_IP, 7, 0, 0, "wccp_set_hash: unknown config_flag 0x300"},
         {WCCP_CFG_HASH_DST_PORT | WCCP_CFG_COMPATIBILITY, 7, 0, 0, "unknown config_flag 0x880"},
-        {WCCP_CFG_HASH_DST_IP, 7, 2, 0},
+        {WCCP_CFG_HASH_DST_IP, 7, 2, 0, ""},
         {WCCP_CFG_MASK_SRC_IP | WCCP_CFG_MASK_DST_IP, 7, 2, 0, "wccp_set_mask: unknown config_flag 0x3000"},
         {WCCP_CFG_MASK_DST_PORT | WCCP_CFG_ROUTERS, 7, 2, 0, "unknown config_flag 0x8001"},
-        {WCCP_CFG_MASK_DST_PORT, 7, 2, 5},
-        {WCCP_CFG_MASK_SRC_IP, 7, 2, 7},
-        {WCCP_CFG_PASSWORD, 7, 2, 7},
+        {WCCP_CFG_MASK_DST_PORT, 7, 2, 5, ""},
+        {WCCP_CFG_MASK_SRC_IP, 7, 2, 7, ""},
+        {WCCP_CFG_PASSWORD, 7, 2, 7, ""},
     };
     log_lines log;
-    for (const auto &row : rows) {
-        SCOPED_TRACE(row.flags);
+    for (const auto &[flags, weight, service, bits, refusal] : rows) {
+        SCOPED_TRACE(flags);
         log.take();
-        EXPECT_EQ(modify(61, row.flags, fill), row.refusal[0] ? 1 : 0);
+        EXPECT_EQ(modify(61, flags, fill), *refusal ? 1 : 0);
         EXPECT_EQ((numbers{group->weight, group->service_flags, group->mask_bits}),
-                  (numbers{row.weight, row.service_flags, row.mask_bits}));
-        EXPECT_TRUE(log.say(row.refusal));
+                  (numbers{weight, service, bits}));
+        EXPECT_TRUE(log.say(refusal));
     }
     for (uint32_t flag = WCCP_CFG_ADMIN; flag <= WCCP_CFG_MASK_DST_PORT; flag <<= 1) { // a missing group
         EXPECT_EQ(modify(99, flag, fill), flag == WCCP_CFG_ADMIN ? 0 : 1) << flag;
@@ -195,8 +177,7 @@ TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
     EXPECT_EQ(memcmp(group->password, "secret\0\0", 8), 0);
     EXPECT_EQ(modify(61, WCCP_CFG_PASSWORD), 0);
     EXPECT_TRUE(group->security_option == 0 && memcmp(group->password, "\0\0\0\0\0\0\0", 8) == 0);
-    EXPECT_EQ(modify(61, WCCP_CFG_HASH_DST_IP), 0);
-    EXPECT_EQ(group->service_flags, 0u);
+    EXPECT_TRUE(modify(61, WCCP_CFG_HASH_DST_IP) == 0 && group->service_flags == 0);
     EXPECT_EQ(modify(99, WCCP_CFG_ROUTERS, fill) + modify(99, 0, fill), 0);
     EXPECT_EQ(wccp_modify_grp(nullptr), 1);
 }
@@ -226,10 +207,9 @@ TEST_F(Config, AStopSendsAShutdownMessageAndKeepsTheConfiguration) {
     EXPECT_EQ(group->hia_timer.active + group->assign_timer.active + group->monitor_timer.active, 0);
     EXPECT_EQ((numbers{group->state_flags, group->fwd_method, group->assign_method, group->ret_method,
                        group->designated, group->change_number, group->dsg_key_change, group->pending_acks,
-                       group->redirecting_routers, group->dsg_appliances[31].weight}),
-              (numbers{WCCP_STATE_INIT, 0, 0, 0, 0, 0, 0, 0, 0, 0}));
-    EXPECT_EQ(group->sending_routers, nullptr);
-    EXPECT_EQ(group->sending_router_count + group->appliance_view_count, 0u);
+                       group->redirecting_routers, group->dsg_appliances[31].weight,
+                       group->sending_router_count, group->appliance_view_count}),
+              (numbers{WCCP_STATE_INIT, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0}));
     EXPECT_TRUE(group->rx_icus == 12 && group->weight == 100 && group->mask_bits == 4);
     EXPECT_TRUE(group->router_alarm_timer.active == 1 && group->router_alarm_timer.countdown == 60);
 
@@ -247,12 +227,10 @@ TEST_F(Config, ADeletedGroupSendsAShutdownMessageUnlessItIsInInit) {
     tables_agree();
     EXPECT_EQ(engine.sent_to("10.0.0.2"), bytes{});
     wccp_grp_list list = {};
-    EXPECT_EQ(wccp_get_grp_list(&list), 0);
-    EXPECT_TRUE(list.count == 4 && list.ids[3] == 255);
+    EXPECT_TRUE(wccp_get_grp_list(&list) == 0 && list.count == 4 && list.ids[3] == 255);
     for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
         make_active(group);
-    EXPECT_EQ(wccp_del_group(3 + 256), 0);
-    EXPECT_EQ(wccp_del_all_groups(), 0);
+    EXPECT_TRUE(wccp_del_group(3 + 256) == 0 && wccp_del_all_groups() == 0);
     for (const uint8_t id : {uint8_t{3}, uint8_t{0}, uint8_t{5}, uint8_t{255}})
         EXPECT_EQ(engine.sent_to("10.0.0.2").at(8 + 8 + 5), id) << "in ascending order of ids";
 }
@@ -264,14 +242,12 @@ TEST_F(Config, StoppingAllSkipsDisabledGroups) {
     unset->admin_state = 0;
     up->change_number = down->change_number = unset->change_number = 3;
     EXPECT_EQ(wccp_stop_all_service_groups(), 0);
-    EXPECT_EQ(up->change_number, 0u);
-    EXPECT_EQ(up->admin_state, WCCP_ADMIN_UP);
+    EXPECT_TRUE(up->change_number == 0 && up->admin_state == WCCP_ADMIN_UP);
     engine.interface->ready_flags = WCCP_LINK_READY;
     wccp_start_service_groups_by_interface(engine.interface);
     EXPECT_EQ(up->hia_timer.active, 0);
     EXPECT_EQ(modify(3, WCCP_CFG_ADMIN), 0); // disabled once more
-    EXPECT_EQ(unset->admin_state, 0u);
-    EXPECT_EQ((numbers{down->change_number, unset->change_number}), (numbers{3, 3}));
+    EXPECT_EQ((numbers{unset->admin_state, down->change_number, unset->change_number}), (numbers{0, 3, 3}));
     engine.interface->ready_flags = WCCP_ALL_READY;
     wccp_grp_config enabled = {};
     enabled.admin = WCCP_ADMIN_UP;
@@ -298,18 +274,11 @@ TEST_F(Config, QueriesForUnknownValuesAndAbsentRecords) {
     for (const uint32_t nobody : {0u, 2u}) {
         router.router_num = nobody;
         router.conn_time = 4711;
-        EXPECT_EQ(wccp_get_grp_router_info(61, &router), 0);
-        EXPECT_EQ(router.conn_time, 4711u);
+        EXPECT_TRUE(wccp_get_grp_router_info(61, &router) == 0 && router.conn_time == 4711);
     }
     wccp_grp_appliance_info appliance = {.appliance_num = 1, .ipa = {}, .weight = 4711};
     EXPECT_EQ(wccp_get_grp_appliance_info(61, &appliance) + wccp_get_grp_appliance_info(60, &appliance), 0);
-    EXPECT_EQ(appliance.weight, 4711u);
-    EXPECT_EQ(wccp_get_grp_router_info(60, &router), 1);
-    EXPECT_EQ(wccp_get_grp_list(nullptr) + wccp_get_grp_info(61, nullptr), 2);
-    EXPECT_EQ(wccp_get_grp_router_info(61, nullptr) + wccp_get_grp_appliance_info(61, nullptr), 2);
-    EXPECT_EQ(wccp_get_router_list(nullptr) + wccp_get_router_appliance_list(nullptr) +
-                  wccp_get_router_appliance_info(nullptr),
-              3);
+    EXPECT_TRUE(appliance.weight == 4711 && wccp_get_grp_router_info(60, &router) == 1);
 }
 
 } // namespace

@@ -4,8 +4,6 @@
 
 #include <algorithm>
 #include <fstream>
-#include <map>
-#include <memory>
 
 #include "runtime/csys.h"
 #include "tests/support/reported_group.h"
@@ -46,12 +44,6 @@ std::string closed(const std::string &text, uint32_t max) {
     return text + "    (debug buffer: used " + std::to_string(text.size()) + " max len " +
            std::to_string(max) + ")\n";
 }
-int count_of(const std::string &text, const std::string &part) {
-    int count = 0;
-    for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1))
-        count++;
-    return count;
-}
 
 int print_51(csys_display_buf *buffer) {
     return wccp_print_service_grp(buffer, 51);
@@ -77,9 +69,8 @@ struct EngineDump : testing::Test, reported_group {
         group->priority = 240;
         memcpy(group->password, "secret12", sizeof group->password);
         group->force_l2_return = 1;
-        group->ucast_routers[0] = host(201);
-        group->ucast_routers[1] = host(202);
-        group->ucast_router_count = 2;
+        for (const uint32_t last : {201u, 202u})
+            group->ucast_routers[group->ucast_router_count++] = host(last);
         group->cfg_fwd_method = WCCP_METHOD_EITHER;
         group->cfg_assign_method = WCCP_ASSIGN_EITHER;
         group->fwd_method = WCCP_METHOD_L2;
@@ -94,17 +85,13 @@ struct EngineDump : testing::Test, reported_group {
         group->raised_alarms = WCCP_ALARM_ADJACENCY | WCCP_ALARM_ASSIGNMENT;
         group->router_alarm_timer = {1, WCCP_TIMER_COUNTS, 1, 30, 12};
         group->assign_alarm_timer = {0, WCCP_TIMER_COUNTS, 1, 30, 5};
-        using counter = uint32_t wccp_service_group::*;
         uint32_t value = 1;
-        for (const counter each :
-             {&wccp_service_group::rx_icus, &wccp_service_group::rx_removal_queries,
-              &wccp_service_group::tx_here_i_am, &wccp_service_group::tx_redirect_assign,
-              &wccp_service_group::tx_removal_replies, &wccp_service_group::alarm_router_sched,
-              &wccp_service_group::alarm_assign_sched, &wccp_service_group::rx_unknown_capabilities,
-              &wccp_service_group::rx_failures, &wccp_service_group::tx_failures,
-              &wccp_service_group::rx_service_mismatches, &wccp_service_group::rx_auth_mismatches,
-              &wccp_service_group::rx_auth_failures})
-            group->*each = value++;
+        for (uint32_t *each :
+             {&group->rx_icus, &group->rx_removal_queries, &group->tx_here_i_am, &group->tx_redirect_assign,
+              &group->tx_removal_replies, &group->alarm_router_sched, &group->alarm_assign_sched,
+              &group->rx_unknown_capabilities, &group->rx_failures, &group->tx_failures,
+              &group->rx_service_mismatches, &group->rx_auth_mismatches, &group->rx_auth_failures})
+            *each = value++;
 
         first->src_ipa = host(211);
         first->receive_id = to_be32(0x12);
@@ -156,17 +143,14 @@ TEST_F(EngineDump, TheWholeTexts) {
     matches(WCCP_DUMP_ALL_BYTES, wccp_print_all_wccp_info, GLOBAL_TEXT);
     wccp_g.group_list = list;
 
-    const dump assignment = dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51);
-    EXPECT_EQ(assignment.result, 0);
-    EXPECT_EQ(assignment.text, HASH_TEXT);
+    EXPECT_EQ(dump_of(WCCP_DUMP_ASSIGNMENT_BYTES, print_assignment_51).text, HASH_TEXT);
     EXPECT_EQ(wccp_print_service_grp_assignment_details(51, nullptr), 1);
 
     log_lines log;
     const dump missing = dump_of(100, [](csys_display_buf *b) {
         return wccp_print_service_grp(b, 7) + wccp_print_service_grp_assignment_details(7, b);
     });
-    EXPECT_EQ(missing.result, 2);
-    EXPECT_EQ(missing.text, "\n    group 7 does not exist!\n");
+    EXPECT_TRUE(missing.result == 2 && missing.text == "\n    group 7 does not exist!\n");
     EXPECT_TRUE(log.say("WCCP GRP 7: show assignment: cannot find group id 7"));
 }
 
@@ -212,10 +196,7 @@ TEST_F(EngineDump, WordsForOtherStates) {
         return text.substr(at, text.find('\n', at) - at);
     };
     wccp_interface primary = {};
-    const struct {
-        std::function<void()> change;
-        const char *label, *wanted;
-    } rows[] = {
+    const std::tuple<std::function<void()>, const char *, const char *> rows[] = {
         {[&] { group->admin_state = WCCP_ADMIN_DOWN; }, "admin state", "disabled"},
         {[&] { group->designated = 0; }, "designated appliance", "no"},
         {[&] { group->raised_alarms = 0; }, "raised alarms", "none"},
@@ -228,9 +209,9 @@ TEST_F(EngineDump, WordsForOtherStates) {
         {[&] { primary.ready_flags = WCCP_ALL_READY; }, "interface ready flags",
          "ipa: no link: ok track intf: ok "},
     };
-    for (const auto &each : rows) {
-        each.change();
-        EXPECT_EQ(row(each.label), each.wanted);
+    for (const auto &[change, label, wanted] : rows) {
+        change();
+        EXPECT_EQ(row(label), wanted);
     }
     wccp_g.primary_if = nullptr;
     const char *const states[] = {"none", "init", "active", "bad", "backup", "bad", "bad", "bad"};
@@ -252,9 +233,7 @@ TEST_F(EngineDump, EveryBufferThatIsTooSmall) {
         // The closing line is shorter with a smaller buffer; 24 bytes less are certainly too few.
         for (uint32_t max = 1; max < length - 24; max += max + 300 < length ? 23 : 1) {
             const dump cut = dump_of(max + overhead, print);
-            ASSERT_EQ(cut.result, 1) << max;
-            ASSERT_EQ(cut.text.back(), '\n') << max;
-            ASSERT_LE(cut.text.size(), max);
+            ASSERT_TRUE(cut.result == 1 && cut.text.back() == '\n' && cut.text.size() <= max) << max;
             ASSERT_EQ(cut.text.compare(0, cut.text.size() - 1, whole.text, 0, cut.text.size() - 1), 0) << max;
             ASSERT_NE(log.take(), "") << max;
         }
@@ -274,8 +253,8 @@ TEST_F(EngineDump, ThirtyTwoRoutersWithThirtyTwoAppliances) {
         EXPECT_EQ(whole.result, 0);
         for (const char *row : {"WCCP view app.id/weight/flags", "WCCP view router id/flags",
                                 "WCCP rx bucket bits 128-255", "Router id"})
-            EXPECT_EQ(count_of(whole.text, row), 1024);
-        EXPECT_NE(whole.text.find("WCCP ICU sending router ** : # 32\n"), std::string::npos);
+            EXPECT_EQ(count_of(row, whole.text), 1024);
+        EXPECT_EQ(count_of("WCCP ICU sending router ** : # 32\n", whole.text), 1);
     }
 }
 

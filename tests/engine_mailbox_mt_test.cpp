@@ -2,18 +2,15 @@
 
 #include "engine/wccpd_common.h"
 
-#include <gtest/gtest.h>
 #include <poll.h>
 #include <sched.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <chrono>
-#include <cstring>
 #include <thread>
-#include <vector>
+
+#include <gtest/gtest.h>
 
 #include "engine/wccp_complaints.h"
 #include "engine/wccp_host.h"
@@ -24,9 +21,7 @@ using namespace std::chrono_literals;
 
 namespace {
 
-mailbox_address address(uint32_t host_order) {
-    return {{host_order, 0}};
-}
+const mailbox_address ONE = {{1, 0}}, TWO = {{2, 0}};
 
 std::atomic<bool> no_waiting, answers_late;
 std::atomic<int> polls, seconds_later;
@@ -41,14 +36,11 @@ struct Mailbox : testing::Test {
     static void SetUpTestSuite() {
         write_mem_conf();
         EXPECT_EQ(wccp_get_tunnel_command(), 0) << "no block yet";
-        EXPECT_EQ(wccp_get_role(7), 2u);
-        EXPECT_EQ(wccp_get_fmst_index(), WCCP_NO_INDEX);
+        EXPECT_TRUE(wccp_get_role(7) == 2 && wccp_get_fmst_index() == WCCP_NO_INDEX);
         wccp_set_tunnel_command_status(0);
         uint32_t index = 5;
-        EXPECT_EQ(wccp_add_tunnel_encap(1, address(1), address(2), &index), 1);
-        EXPECT_EQ(wccp_cleanup_shmem(), 0);
-        ASSERT_EQ(wccp_init_shmem(), 0);
-        EXPECT_EQ(wccp_get_fmst_index(), WCCP_NO_INDEX);
+        EXPECT_TRUE(wccp_add_tunnel_encap(1, ONE, TWO, &index) == 1 && wccp_cleanup_shmem() == 0);
+        ASSERT_TRUE(wccp_init_shmem() == 0 && wccp_get_fmst_index() == WCCP_NO_INDEX);
         EXPECT_EQ(wccp_init_shmem(), 1) << "its creator lives";
         ASSERT_TRUE(wccp_mailbox);
     }
@@ -95,16 +87,14 @@ TEST(SecondWccpd, TouchesNothingOfTheFirst) {
         char byte;
         EXPECT_EQ(read(ready[0], &byte, 1), 1);
         log_lines log;
-        EXPECT_EQ(wccp_init_shmem(), 1);
-        EXPECT_NE(log.take().find("double create attempt"), std::string::npos);
+        EXPECT_TRUE(wccp_init_shmem() == 1 && log.say("double create attempt"));
         wccp_set_role(id, 1);
         wccp_add_policy_grp(300, 1, &id);
         wccp_del_entire_policy_grp(300);
         EXPECT_EQ(log.take(), "");
         uint32_t index = 5;
-        EXPECT_EQ(wccp_del_tunnel_encap(1, address(1), address(2), &index), 1);
-        EXPECT_EQ(wccp_cleanup_shmem(), 0);
-        EXPECT_EQ(wccp_get_role(300), 0u);
+        EXPECT_EQ(wccp_del_tunnel_encap(1, ONE, TWO, &index), 1);
+        EXPECT_EQ(wccp_cleanup_shmem() + wccp_get_role(300), 0u);
         EXPECT_EQ(wccp_get_tunnel_command(), MAILBOX_L2_RETURN);
         EXPECT_EQ(mailbox_get(wccp_mailbox->l2_value), 7u);
         kill(first, SIGKILL);
@@ -112,8 +102,7 @@ TEST(SecondWccpd, TouchesNothingOfTheFirst) {
         _exit(testing::Test::HasFailure());
     }
     int status = -1;
-    ASSERT_EQ(waitpid(second, &status, 0), second);
-    EXPECT_EQ(status, 0);
+    ASSERT_TRUE(waitpid(second, &status, 0) == second && status == 0);
 }
 
 #ifndef WCCP_SANITIZED
@@ -132,49 +121,42 @@ TEST_F(Mailbox, WithoutMemoryAMembershipIsRefusedAndTheRestStays) {
         ASSERT_EQ(wccp_check_policy_group(policy, id), policy < refused);
     wccp_set_role(id, 0);
     EXPECT_EQ(wccp_get_role(refused), 2u);
-    EXPECT_EQ(wccp_get_role(static_cast<uint16_t>(refused - 1)), 0u)
-        << "it follows the last one that accepted it";
+    EXPECT_EQ(wccp_get_role(static_cast<uint16_t>(refused - 1)), 0u) << "the last one that accepted it";
     EXPECT_EQ(wccp_add_policy_grp(refused, 1, &id), 0) << "with memory again";
 }
 #endif
 
 TEST_F(Mailbox, AnswersComeBackAsTheyWereGiven) {
-    static const struct {
-        tunneld_answer answer;
-        int add, other;
-        uint32_t index;
-    } cases[] = {
+    // The results of an add and of the others, and the index.
+    static const std::tuple<tunneld_answer, int, int, uint32_t> cases[] = {
         {{0, 77}, 0, 0, 77},
         {{1, 77}, 1, 1, 77},
         {{5, 78}, 5, 5, 78},
-        {{0, WCCP_NO_INDEX}, 1, 0, WCCP_NO_INDEX},
-    };
-    for (const auto &row : cases) {
-        fake_tunneld tunneld([&](const seen_command &) { return row.answer; });
+        {{0, WCCP_NO_INDEX}, 1, 0, WCCP_NO_INDEX}};
+    for (const auto &[answer, add, other, last] : cases) {
+        fake_tunneld tunneld([&given_answer = answer](const seen_command &) { return given_answer; });
         uint32_t index = WCCP_NO_INDEX;
-        EXPECT_EQ(wccp_add_tunnel_encap(300, address(0x0A000001), address(0xFFFFFFFE), &index), row.add);
-        EXPECT_EQ(index, row.index);
+        EXPECT_EQ(wccp_add_tunnel_encap(300, {{0x0A000001, 0}}, {{0xFFFFFFFE, 0}}, &index), add);
+        EXPECT_EQ(index, last);
         index = 4;
-        EXPECT_EQ(wccp_del_tunnel_encap(65534, address(0x0A000001), address(0xC0A80001), &index), row.other);
-        EXPECT_EQ(index, row.index);
-        EXPECT_EQ(wccp_set_L2_return(255, 0xABCD1234), row.other);
+        EXPECT_EQ(wccp_del_tunnel_encap(65534, {{0x0A000001, 0}}, {{0xC0A80001, 0}}, &index), other);
+        EXPECT_TRUE(index == last && wccp_set_L2_return(255, 0xABCD1234) == other);
         const std::vector<seen_command> given = tunneld.take_commands();
         ASSERT_EQ(given.size(), 3u);
         const uint8_t group = given[0].l2_group; // what is not an input of a command is unchanged
-        const uint32_t value = given[0].l2_value, last = row.index;
-        EXPECT_EQ(given, (std::vector<seen_command>{
-                             {2, 300, 0x0A000001, 0xFFFFFFFE, WCCP_NO_INDEX, group, value},
-                             {1, 65534, 0x0A000001, 0xC0A80001, 4, group, value},
-                             {3, 65534, 0x0A000001, 0xC0A80001, last, 255, 0xABCD1234},
-                         }));
+        const uint32_t value = given[0].l2_value;
+        EXPECT_EQ(given,
+                  (std::vector<seen_command>{{2, 300, 0x0A000001, 0xFFFFFFFE, WCCP_NO_INDEX, group, value},
+                                             {1, 65534, 0x0A000001, 0xC0A80001, 4, group, value},
+                                             {3, 65534, 0x0A000001, 0xC0A80001, last, 255, 0xABCD1234}}));
     }
 }
 
 // No answers. A wait takes 2000 polls.
 TEST_F(Mailbox, ATunneldThatDoesNotAnswerIsTriedAgainAfterTenSeconds) {
     uint32_t index = 42;
-    const auto add = [&] { return wccp_add_tunnel_encap(9, address(1), address(2), &index); };
-    const auto remove = [&] { return wccp_del_tunnel_encap(9, address(1), address(2), &index); };
+    const auto add = [&] { return wccp_add_tunnel_encap(9, ONE, TWO, &index); };
+    const auto remove = [&] { return wccp_del_tunnel_encap(9, ONE, TWO, &index); };
     const auto l2_return = [] { return wccp_set_L2_return(3, 1); };
     const auto clear_slot = [] { wccp_set_tunnel_command_status(0); };
     const auto exiting = [](int value) { return [value] { wccpd_exiting = value; }; };
@@ -221,9 +203,8 @@ TEST_F(Mailbox, ATunneldThatDoesNotAnswerIsTriedAgainAfterTenSeconds) {
             step.before();
         polls = 0;
         EXPECT_EQ(step.give(), step.result);
-        EXPECT_EQ(index, step.result ? 42u : 77u);
-        EXPECT_EQ(polls, step.polls);
-        EXPECT_EQ(wccp_get_tunnel_command(), step.left);
+        EXPECT_EQ(std::tuple(index, polls.load(), wccp_get_tunnel_command()),
+                  std::tuple(step.result ? 42 : 77, step.polls, step.left));
         const std::string said = log.take();
         EXPECT_TRUE(step.line.empty() ? said.empty() : said.find(step.line) != std::string::npos) << said;
     }
@@ -279,8 +260,7 @@ TEST_F(Mailbox, AReplacedCommandIsNeverReadHalf) {
     }
     stop = true;
     writer.join();
-    EXPECT_GT(whole, 100);
-    EXPECT_EQ(torn, 0);
+    EXPECT_TRUE(whole > 100 && torn == 0);
 }
 
 TEST_F(Mailbox, AResetEndsAWaitWithoutAnAnswer) {
@@ -289,21 +269,17 @@ TEST_F(Mailbox, AResetEndsAWaitWithoutAnAnswer) {
         int results[2] = {-1, -1};
         uint32_t indices[2] = {42, 42};
         const double took = seconds_of([&] {
-            std::thread add(
-                [&] { results[0] = wccp_add_tunnel_encap(9, address(1), address(2), &indices[0]); });
+            std::thread add([&] { results[0] = wccp_add_tunnel_encap(9, ONE, TWO, &indices[0]); });
             tunneld.wait_for_command();
-            std::thread queued(
-                [&] { results[1] = wccp_del_tunnel_encap(9, address(1), address(2), &indices[1]); });
+            std::thread queued([&] { results[1] = wccp_del_tunnel_encap(9, ONE, TWO, &indices[1]); });
             wccp_cleanup_shmem();
             add.join();
             tunneld.answer_with(tunneld_does);
             queued.join();
         });
-        EXPECT_EQ(results[0], 1);
-        EXPECT_EQ(indices[0], 42u);
-        EXPECT_LT(took, 1.5);
+        EXPECT_TRUE(results[0] == 1 && indices[0] == 42 && took < 1.5) << took;
         uint32_t index = 3;
-        EXPECT_EQ(wccp_del_tunnel_encap(9, address(1), address(2), &index), 0) << "later commands work";
+        EXPECT_EQ(wccp_del_tunnel_encap(9, ONE, TWO, &index), 0) << "later commands work";
         EXPECT_EQ(index, 1009u);
     }
 }
@@ -313,20 +289,18 @@ TEST_F(Mailbox, AServiceGroupFollowsItsLastPolicyGroup) {
     wccp_set_role(id, 0);
     wccp_add_policy_grp(1, 1, &id);
     wccp_add_policy_grp(65535, 1, &id);
-    EXPECT_EQ(wccp_check_policy_group(1, id), 1) << "the bit remains";
-    EXPECT_EQ(wccp_check_policy_group(65535, id), 1);
-    wccp_set_role(id, 1);
-    EXPECT_EQ(wccp_get_role(1), 0u);
-    EXPECT_EQ(wccp_get_role(65535), 1u);
+    for (const uint16_t policy : {uint16_t{1}, uint16_t{65535}})
+        EXPECT_EQ(wccp_check_policy_group(policy, id), 1) << "the bit remains";
+    const auto roles = [&](uint32_t next, const std::vector<uint32_t> &wanted) { // of 0, 1 and 65535
+        wccp_set_role(id, next);
+        EXPECT_EQ((std::vector{wccp_get_role(0), wccp_get_role(1), wccp_get_role(65535)}), wanted);
+    };
+    roles(1, {2, 0, 1});
     wccp_del_entire_policy_grp(1);
-    EXPECT_EQ(wccp_get_role(1), 2u);
-    wccp_set_role(id, 0);
-    EXPECT_EQ(wccp_get_role(65535), 1u) << "since the delete it has no policy group";
+    roles(0, {2, 2, 1}); // since the delete it has no policy group
     // Policy group 0 can have members but does not follow them.
     wccp_add_policy_grp(0, 1, &id);
-    EXPECT_EQ(wccp_get_role(0), 0u);
-    wccp_set_role(id, 1);
-    EXPECT_EQ(wccp_get_role(0), 0u);
+    roles(1, {0, 2, 1});
 }
 
 TEST_F(Mailbox, AnyNumberOfPolicyGroupsKeepsItsMembers) {

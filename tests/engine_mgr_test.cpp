@@ -4,7 +4,6 @@
 #include <sched.h>
 #include <signal.h>
 #include <sys/resource.h>
-#include <unistd.h>
 
 #include <algorithm>
 
@@ -24,8 +23,7 @@ int qv_start_netlink_monitor(uint32_t) {
 
 namespace {
 
-class Manager : public testing::Test {
-protected:
+struct Manager : testing::Test {
     void SetUp() override {
         wccpd_exiting = 0;
         registration_fails = false;
@@ -49,18 +47,12 @@ protected:
 
 TEST_F(Manager, StartsThreadsMailboxAndPrimaryInterface) {
     memset(static_cast<void *>(&wccp_g.seconds), 0xff, sizeof wccp_g.seconds);
-    ASSERT_EQ(wccp_init_mgr(), 0);
-    EXPECT_LT(wccp_g.seconds, 10u);
-    EXPECT_EQ(wccp_g.mcast_ttl, 5);
-    ASSERT_NE(wccp_g.primary_if, nullptr);
+    ASSERT_TRUE(wccp_init_mgr() == 0 && wccp_g.primary_if);
     EXPECT_STREQ(wccp_g.primary_if->name, "lo");
-    EXPECT_EQ(wccp_g.interfaces[126].ucast_fd, -1);
-    EXPECT_NE(wccp_mailbox, nullptr);
-    EXPECT_EQ(threads_named("WCCP_TIMER"), 1);
-    EXPECT_EQ(threads_named("WCCP_RX_lo"), 1);
+    EXPECT_TRUE(wccp_g.seconds < 10 && wccp_g.mcast_ttl == 5 && wccp_g.interfaces[126].ucast_fd == -1);
+    EXPECT_TRUE(wccp_mailbox && threads_named("WCCP_TIMER") == 1 && threads_named("WCCP_RX_lo") == 1);
     const wccp_service_group *zero = add_group(0, WCCP_ADMIN_DOWN);
-    EXPECT_EQ(wccp_find_group(256), zero);
-    EXPECT_EQ(wccp_find_group(1), nullptr);
+    EXPECT_TRUE(wccp_find_group(256) == zero && !wccp_find_group(1));
 }
 
 TEST_F(Manager, AFailingLinkManagerIsNotAFailure) {
@@ -83,9 +75,9 @@ TEST_F(Manager, InBridgeModeThereAreReceiversButNoTicks) {
     wccp_tick();
     wccpd_exiting = 1;
     wccp_tick();
-    EXPECT_EQ(wccp_g.seconds, 2u);
-    EXPECT_EQ(up->monitor_timer.countdown, 3u);
-    EXPECT_EQ(down->monitor_timer.countdown + unset->monitor_timer.countdown, 10u);
+    EXPECT_EQ(std::tuple(wccp_g.seconds, up->monitor_timer.countdown, down->monitor_timer.countdown,
+                         unset->monitor_timer.countdown),
+              std::tuple(2, 3, 5, 5));
 }
 
 TEST_F(Manager, OnlyBridgeModeStopsTheEngine) {
@@ -96,11 +88,9 @@ TEST_F(Manager, OnlyBridgeModeStopsTheEngine) {
     for (const char *mode : {"", "Bridge", "bridged", "bridg"})
         EXPECT_EQ(wccp_system_mode_change_event(mode), 1);
     EXPECT_EQ(wccp_system_mode_change_event(nullptr), 1);
-    EXPECT_EQ(group->hia_timer.active, 1);
-    EXPECT_EQ(threads_named("WCCP_TIMER"), 1);
+    EXPECT_TRUE(group->hia_timer.active == 1 && threads_named("WCCP_TIMER") == 1);
     EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0);
-    EXPECT_EQ(group->hia_timer.active, 0);
-    EXPECT_EQ(group->admin_state, WCCP_ADMIN_UP);
+    EXPECT_TRUE(group->hia_timer.active == 0 && group->admin_state == WCCP_ADMIN_UP);
     EXPECT_EQ(wccp_system_mode_change_event("router"), 0) << "nothing starts them again";
     EXPECT_EQ(threads_named("WCCP_TIMER") + threads_named("WCCP_RX_lo"), 0);
 }
@@ -115,31 +105,27 @@ TEST_F(Manager, AllocationsAreZeroedAndCounted) {
     EXPECT_EQ(std::count(clean, clean + 4096, 0), 4096);
     wccp_free(clean);
     wccp_free(nullptr);
-    EXPECT_EQ(wccp_g.stat_allocs, allocs + 2);
-    EXPECT_EQ(wccp_g.stat_frees, frees + 2);
+    EXPECT_TRUE(wccp_g.stat_allocs == allocs + 2 && wccp_g.stat_frees == frees + 2);
 #ifndef WCCP_SANITIZED // whose allocator ends the program
     EXPECT_EQ(wccp_calloc(0xffffffff, 0xffffffff), nullptr);
-    EXPECT_EQ(wccp_g.stat_alloc_fails, 1u);
-    EXPECT_EQ(wccp_g.stat_allocs, allocs + 2);
+    EXPECT_TRUE(wccp_g.stat_alloc_fails == 1 && wccp_g.stat_allocs == allocs + 2);
 #endif
 }
 
 TEST(Text, ATimeIsWrittenOnlyWhereItFits) {
-    const struct {
-        uint32_t seconds, length;
-        const char *text;
-    } rows[] = {{0xffffffff, 128, "49710:6:28:15"}, {59, 256 + 32, "0:0:0:59"}, {1, 31, ""}, {1, 256, ""}};
-    for (const auto &row : rows) {
+    const std::tuple<uint32_t, uint32_t, const char *> rows[] = {
+        {0xffffffff, 128, "49710:6:28:15"}, {59, 256 + 32, "0:0:0:59"}, {1, 31, ""}, {1, 256, ""}};
+    for (const auto &[seconds, length, wanted] : rows) {
         char text[512] = "";
-        wccp_seconds_to_str(row.seconds, text, row.length);
-        EXPECT_STREQ(text, row.text);
+        wccp_seconds_to_str(seconds, text, length);
+        EXPECT_STREQ(text, wanted);
     }
 }
 
 struct observation {
     size_t stack = 0;
     sigset_t blocked;
-    cpu_set_t cpus;
+    cpu_set_t cpus = {};
     int runs = 0, nice = 0;
     void *ended = nullptr;
 };
@@ -151,7 +137,6 @@ void *observe_thread(void *argument) {
     pthread_attr_getstacksize(&attributes, &seen->stack);
     pthread_attr_destroy(&attributes);
     pthread_sigmask(SIG_BLOCK, nullptr, &seen->blocked);
-    CPU_ZERO(&seen->cpus);
     sched_getaffinity(0, sizeof seen->cpus, &seen->cpus);
     seen->nice = getpriority(PRIO_PROCESS, 0);
     seen->runs++;
@@ -172,9 +157,7 @@ TEST(Thread, HasItsNameStackSignalMaskAndCpu) {
     ASSERT_EQ(cthread_start(context), 0);
     EXPECT_TRUE(context->listed == 1 && context->heartbeat != 0);
     cthread_join(context);
-    EXPECT_EQ(seen.runs, 1);
-    EXPECT_EQ(seen.ended, &seen) << "the end function runs after the body";
-    EXPECT_EQ(seen.nice, 3);
+    EXPECT_TRUE(seen.runs == 1 && seen.nice == 3 && seen.ended == &seen) << "the end function";
 #ifndef WCCP_SANITIZED // the sanitizers need more
     EXPECT_LE(seen.stack, 132u * 1024);
 #endif
@@ -196,23 +179,22 @@ void *sleep_for_ever(void *) {
     for (;;)
         pause();
 }
+cthread *make_sleeper(uint32_t policy) {
+    return cthread_init("sleeper", sleep_for_ever, nullptr, nullptr, nullptr, policy, 0, 0, 0);
+}
 
 TEST(Thread, ThatDoesNotStartEndsAllTheSame) {
-    const auto make = [](uint32_t policy) {
-        return cthread_init("idle", sleep_for_ever, nullptr, nullptr, nullptr, policy, 0, 0, 0);
-    };
-    cthread *idle = make(SCHED_OTHER), *refused = make(77);
+    cthread *idle = make_sleeper(SCHED_OTHER), *refused = make_sleeper(77);
     cthread_cancel(idle);
     cthread_join(idle);
-    EXPECT_EQ(cthread_start(refused), 1);
-    EXPECT_EQ(refused->listed, 0);
+    EXPECT_TRUE(cthread_start(refused) == 1 && refused->listed == 0);
     cthread_join(refused);
 }
 
 TEST(Thread, AllAreCancelledBeforeTheFirstIsJoined) {
     cthread *one = nullptr;
     for (int i = 0; i < 21; i++) {
-        one = cthread_init("sleeper", sleep_for_ever, nullptr, nullptr, nullptr, SCHED_OTHER, 0, 0, 0);
+        one = make_sleeper(SCHED_OTHER);
         ASSERT_EQ(cthread_start(one), 0);
     }
     cthread_cancel(one);
@@ -222,8 +204,7 @@ TEST(Thread, AllAreCancelledBeforeTheFirstIsJoined) {
     int count = 0;
     for (const cthread *context = chain; context; context = context->next)
         count++;
-    EXPECT_EQ(count, 20);
-    EXPECT_EQ(cthread_cancel_listed(), nullptr);
+    EXPECT_TRUE(count == 20 && !cthread_cancel_listed());
     cthread_join_chain(chain);
     cthread_cancel_all();
 }

@@ -2,34 +2,25 @@
 
 #include "engine/wccp_pkt_load.h"
 
-#include <gtest/gtest.h>
-
 #include <algorithm>
-#include <cstring>
-#include <memory>
 
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_wire.h"
-#include "tests/support/log_lines.h"
+#include "tests/support/reported_group.h"
 #include "tests/support/wire_bytes.h"
 
 namespace {
 
 using bytes = std::vector<uint8_t>;
 
-be32 ipa(uint8_t third, uint8_t fourth) {
-    return {{10, 0, third, fourth}};
-}
-
 // A group outside the engine's tables, and a zeroed packet.
-class Load : public testing::Test {
-protected:
+struct Load : testing::Test {
     void SetUp() override {
         group->id = 50;
         group->priority = 200;
         group->protocol = 6;
         group->service_flags = 0x13;
-        group->appliance_ipa = ipa(0, 100);
+        group->appliance_ipa = host(100);
         group->weight = 0x0102;
         group->change_number = 0x01020304;
         clear();
@@ -41,7 +32,7 @@ protected:
     void add_routers(uint32_t count) {
         for (uint32_t i = 0; i < count; i++) {
             wccp_sending_router *router = &routers[i];
-            router->router_id = ipa(1, static_cast<uint8_t>(i + 1));
+            router->router_id = host(0x101 + i);
             router->receive_id = to_be32(0xa1a2a300 + i);
             router->change_number = to_be32(0xc1c2c300 + i);
             router->next = group->sending_routers;
@@ -51,7 +42,7 @@ protected:
     }
     void add_appliances(uint32_t count) {
         for (uint32_t i = 0; i < count; i++) {
-            appliances[i].ipa = ipa(static_cast<uint8_t>(i >> 8), static_cast<uint8_t>(100 + i));
+            appliances[i].ipa = host((i & 0xffff00) | ((100 + i) & 0xff));
             appliances[i].next = group->appliance_view;
             group->appliance_view = &appliances[i];
         }
@@ -62,7 +53,7 @@ protected:
         group->dsg_key_change = 0x0a0b0c0d;
         group->dsg_appliance_count = group->dsg_active_count = active;
         for (uint32_t i = 0; i < active; i++)
-            group->dsg_appliances[i].ipa = ipa(0, static_cast<uint8_t>(100 + i));
+            group->dsg_appliances[i].ipa = host(100 + i);
     }
     bytes loaded() const { return {pkt->data, pkt->data + pkt->length}; }
 
@@ -72,19 +63,15 @@ protected:
     std::unique_ptr<wccp_view_appliance[]> appliances{new wccp_view_appliance[2048]{}};
 };
 
-const wire_bytes no_security = hex("0000 0004 00000000");
-const wire_bytes standard_service = hex("0001 0018 00 32 00*22");
-const wire_bytes dynamic_service = hex("0001 0018 01 33 c8 06 00000013 00*16");
+const wire_bytes no_security = hex("0000 0004 00000000"), standard_service = hex("0001 0018 00 32 00*22"),
+                 dynamic_service = hex("0001 0018 01 33 c8 06 00000013 00*16");
 
 TEST_F(Load, TheFirstHereIAmOfAStandardGroup) {
     const wire_bytes identity = hex("0003 002c 0a000064 0000 0000 00*32 0102 0000");
     const wire_bytes view = hex("0005 000c 01020304 00000000 00000000");
     ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
     EXPECT_EQ(loaded(), wire_message(10, {no_security, standard_service, identity, view}));
-    EXPECT_EQ(pkt->length, 108u);
-    EXPECT_EQ(pkt->data[7], 100);
-    EXPECT_EQ(pkt->cursor, pkt->data + 108);
-    EXPECT_EQ(pkt->offset, 108u);
+    EXPECT_TRUE(pkt->length == 108 && pkt->offset == 108 && pkt->cursor == pkt->data + 108);
 }
 
 // Every component of a Here-I-Am. The digest was computed by md5sum over the 8 bytes of the password and this
@@ -128,10 +115,7 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
 }
 
 TEST_F(Load, CapabilitiesListWhatDiffersFromTheDefaults) {
-    const struct {
-        uint32_t fwd, assign, ret;
-        const char *expected;
-    } rows[] = {
+    const std::tuple<uint32_t, uint32_t, uint32_t, const char *> rows[] = {
         {0, 0, 0, ""},
         {1, 1, 1, ""},
         {2, 1, 1, "0008 0008 0001 0004 00000002"},
@@ -140,15 +124,14 @@ TEST_F(Load, CapabilitiesListWhatDiffersFromTheDefaults) {
         {2, 1, 2, "0008 0010 0001 0004 00000002 0003 0004 00000002"},
     };
     log_lines log;
-    for (const auto &row : rows) {
+    for (const auto &[fwd, assign, ret, expected] : rows) {
         clear();
-        group->fwd_method = row.fwd;
-        group->assign_method = row.assign;
-        group->ret_method = row.ret;
+        group->fwd_method = fwd;
+        group->assign_method = assign;
+        group->ret_method = ret;
         EXPECT_EQ(wccp_pkt_load_capability_info_component(group.get(), pkt.get()), 0);
-        EXPECT_EQ(loaded(), wire_bytes().hex(row.expected).bytes);
-        EXPECT_EQ(log.say("WCCP: GRP 50 loading capability comp. all capabilities are default."),
-                  !*row.expected);
+        EXPECT_EQ(loaded(), hex(expected).bytes);
+        EXPECT_EQ(log.say("WCCP: GRP 50 loading capability comp. all capabilities are default."), !*expected);
     }
 }
 
@@ -168,9 +151,8 @@ TEST_F(Load, ARedirectAssignByHash) {
     EXPECT_EQ(loaded(), wire_message(12, {no_security, dynamic_service, assignment}));
     clear();
     ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
-    EXPECT_EQ(routers[0].assign_tx_count, 2u);
-    EXPECT_EQ(routers[1].assign_tx_count, 2u);
-    EXPECT_EQ(routers[2].assign_tx_count, 0u);
+    EXPECT_EQ(std::tuple(routers[0].assign_tx_count, routers[1].assign_tx_count, routers[2].assign_tx_count),
+              std::tuple(2, 2, 0));
 }
 
 TEST_F(Load, ARedirectAssignByMask) {
@@ -182,8 +164,8 @@ TEST_F(Load, ARedirectAssignByMask) {
     group->mask_dst_ip = 0xffffffff; // configured, replaced
     group->mask_in_use = {0x01020304, 0x00000f00, 0x0506, 0x0708};
     group->mask_value_count = 2;
-    group->mask_values[0] = {0, 0x100, 0, 0x0700, ipa(0, 101)};
-    group->mask_values[1] = {0x01000000, 0, 0x0506, 0, ipa(0, 100)};
+    group->mask_values[0] = {0, 0x100, 0, 0x0700, host(101)};
+    group->mask_values[1] = {0x01000000, 0, 0x0506, 0, host(100)};
     const wire_bytes assignment = hex("000d 0050 0001 004c 0a000064 0a0b0c0d "
                                       "00000001 0a000101 a1a2a300 c1c2c300 "
                                       "00000001 01020304 00000f00 0506 0708 "
@@ -198,11 +180,10 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
     add_routers(1);
     const struct {
         uint32_t designated, routers, active, values, appliances;
-        int by_hash, by_mask, by_neither;
+        int by_hash, by_mask;
     } rows[] = {
-        {1, 1, 1, 1, 1, 0, 0, 1},    {0, 1, 1, 1, 1, 1, 1, 1},
-        {1, 0, 1, 1, 1, 1, 1, 1},    {1, 1, 0, 0, 1, 1, 1, 1},
-        {1, 1, 33, 129, 1, 1, 1, 1}, {1, 1, 1, 1, 0, 0, 1, 1}, // only the mask form needs the view
+        {1, 1, 1, 1, 1, 0, 0},    {0, 1, 1, 1, 1, 1, 1}, {1, 0, 1, 1, 1, 1, 1}, {1, 1, 0, 0, 1, 1, 1},
+        {1, 1, 33, 129, 1, 1, 1}, {1, 1, 1, 1, 0, 0, 1}, // only the mask form needs the view
     };
     log_lines log;
     const auto text = [](uint32_t number) { return std::to_string(number); };
@@ -214,29 +195,30 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
         group->dsg_active_count = row.active;
         group->mask_value_count = row.values;
         group->appliance_view_count = row.appliances;
-        const int expected[] = {row.by_neither, row.by_hash, row.by_mask, row.by_neither};
         const std::string state = "invalid designated appliance state. designated " + text(row.designated) +
                                   " # routers " + text(row.routers);
         const std::string neither =
-            "WCCP: redirect assign: groups actual assignment method is not set. failed.";
-        const std::string refused[] = {neither,
-                                       "WCCP GRP 50: redirect assignment load: " + state +
-                                           " # active appliances " + text(row.active) + "\n",
-                                       "WCCP GRP 50: TX MASK redirect assign: " + state + " appliances " +
-                                           text(row.appliances) + " values: " + text(row.values) + "\n",
-                                       neither};
-        const std::string names[] = {"", "HASH", "MASK", ""};
+                              "WCCP: redirect assign: groups actual assignment method is not set. failed.",
+                          unassigned =
+                              " redirect assign: not all buckets are assigned. assigned: 4 total: 7\n";
+        const std::tuple<int, std::string> expected[] = {
+            {1, neither},
+            {row.by_hash, row.by_hash ? "WCCP GRP 50: redirect assignment load: " + state +
+                                            " # active appliances " + text(row.active) + "\n"
+                                      : "WCCP GRP 50: TX HASH" + unassigned},
+            {row.by_mask, row.by_mask ? "WCCP GRP 50: TX MASK redirect assign: " + state + " appliances " +
+                                            text(row.appliances) + " values: " + text(row.values) + "\n"
+                                      : "WCCP GRP 50: TX MASK" + unassigned},
+            {1, neither}};
         for (uint32_t method = 0; method < 4; method++) {
+            const auto &[result, line] = expected[method];
             clear();
             group->assign_method = method;
             const uint32_t sent = routers[0].assign_tx_count;
-            EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), expected[method]);
-            EXPECT_EQ(routers[0].assign_tx_count, sent + (expected[method] ? 0 : 1));
-            EXPECT_EQ(pkt->length == 44, expected[method] == 1) << "up to the failing component";
-            EXPECT_TRUE(log.say(expected[method] ? refused[method]
-                                                 : "WCCP GRP 50: TX " + names[method] +
-                                                       " redirect assign: not all buckets are assigned. "
-                                                       "assigned: 4 total: 7\n"));
+            EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), result);
+            EXPECT_EQ(routers[0].assign_tx_count, sent + (result ? 0 : 1));
+            EXPECT_EQ(pkt->length == 44, result == 1) << "up to the failing component";
+            EXPECT_TRUE(log.say(line)) << line;
         }
     }
     group->bucket_count = 4; // all slots are assigned
@@ -259,21 +241,18 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
     add_appliances(32);
     designate(32);
     group->mask_value_count = 128;
-    const struct {
-        int (*build)(wccp_service_group *, wccp_pkt *);
-        uint32_t assign_method;
-        std::vector<uint32_t> sizes;
-    } rows[] = {
+    const std::tuple<int (*)(wccp_service_group *, wccp_pkt *), uint32_t, std::vector<uint32_t>> rows[] = {
         {wccp_pkt_build_here_i_am, 2, {8, 24, 28, 36, 16 + 8 * 32 + 4 * 32, 28, 12}},
         {wccp_pkt_build_here_i_am, 1, {8, 24, 28, 48, 16 + 8 * 32 + 4 * 32, 20, 12}},
         {wccp_pkt_build_redirect_assign, 1, {8, 24, 28, 276 + 12 * 32 + 4 * 32}},
         {wccp_pkt_build_redirect_assign, 2, {8, 24, 28, 40 + 12 * 32 + 16 * 128}},
     };
-    for (const auto &row : rows) {
-        group->assign_method = row.assign_method;
+    for (const auto &[build, assign_method, sizes] : rows) {
+        group->assign_method = assign_method;
         std::vector<uint32_t> starts = {0};
-        for (uint32_t i = 0, sum = 0; i < row.sizes.size(); i++) {
-            sum += row.sizes[i];
+        uint32_t sum = 0;
+        for (const uint32_t size : sizes) {
+            sum += size;
             starts.insert(starts.end(), {4096 - sum, 4096 - sum + 1});
         }
         log_lines log;
@@ -282,14 +261,13 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
             pkt->length = pkt->offset = start;
             uint32_t end = start;
             size_t fitting = 0;
-            while (fitting < row.sizes.size() && end + row.sizes[fitting] <= 4096)
-                end += row.sizes[fitting++];
-            EXPECT_EQ(row.build(group.get(), pkt.get()), fitting == row.sizes.size() ? 0 : 1) << start;
+            while (fitting < sizes.size() && end + sizes[fitting] <= 4096)
+                end += sizes[fitting++];
+            EXPECT_EQ(build(group.get(), pkt.get()), fitting == sizes.size() ? 0 : 1) << start;
             EXPECT_TRUE(pkt->length == end && pkt->offset == end) << start;
             EXPECT_EQ(std::count(pkt->data + end, pkt->data + 4096, 0), 4096 - end) << start;
-            EXPECT_EQ(log.say("WCCP GRP 50: TX MASK redirect assign: component: (len 2472) does not fit in "
-                              "the pkt."),
-                      row.sizes.size() == 4 && row.assign_method == 2 && fitting == 3);
+            EXPECT_EQ(log.say("TX MASK redirect assign: component: (len 2472) does not fit in the pkt."),
+                      sizes.size() == 4 && assign_method == 2 && fitting == 3);
         }
     }
 }
@@ -303,21 +281,16 @@ TEST_F(Load, AViewThatIsTooLargeOrMiscountedIsRefused) {
     clear();
     EXPECT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 1);
     log_lines log;
-    const struct {
-        uint32_t *count;
-        const char *line;
-    } lists[] = {
+    const std::pair<uint32_t *, const char *> lists[] = {
         {&group->sending_router_count, "WCCP router count (31) mismatch with entries in router view list"},
-        {&group->appliance_view_count,
-         "WCCP web cache count (954) mismatch with entries in appliance view list"},
+        {&group->appliance_view_count, "web cache count (954) mismatch with entries in appliance view list"},
     };
-    for (const auto &list : lists) {
+    for (const auto &[count, line] : lists) {
         clear();
-        --*list.count;
+        --*count;
         EXPECT_EQ(wccp_pkt_load_web_cache_view_info_component(group.get(), pkt.get()), 1);
-        EXPECT_EQ(pkt->length, 0u);
-        EXPECT_TRUE(log.say(list.line));
-        ++*list.count;
+        EXPECT_TRUE(pkt->length == 0 && log.say(line));
+        ++*count;
     }
 }
 

@@ -3,9 +3,6 @@
 
 #include "engine/wccp_pkt_mgr.h"
 
-#include <array>
-#include <sstream>
-
 #include "engine/wccp_complaints.h"
 #include "engine/wccp_router_utils.h"
 #include "tests/support/engine_fixture.h"
@@ -33,12 +30,12 @@ struct element {
     uint32_t id, weight, bucket_byte;
 };
 // A view of one router.
-wire_bytes view(uint32_t router, const std::vector<element> &elements, uint32_t key_change = 0,
-                uint32_t key_address = 100) {
+wire_bytes view(uint32_t router, const std::vector<element> &elements, uint32_t key = 0,
+                uint32_t owner = 100) {
     std::vector<hash_element> seen;
     for (const element &each : elements)
         seen.push_back(element_of(host(each.id), each.weight, each.bucket_byte));
-    return router_view({host(router)}, seen, host(key_address), key_change);
+    return router_view({host(router)}, seen, host(owner), key);
 }
 // The same with mask elements that redirect, in the IOS form.
 wire_bytes mask_view(uint32_t router, const std::vector<uint32_t> &ids) {
@@ -55,9 +52,9 @@ wire_bytes map(const std::vector<uint32_t> &ids) {
         out.u32(id).u32(0).u32(0).ip(0, id);
     return out.put16(2, static_cast<uint32_t>(out.size() - 4));
 }
-const wire_bytes by_hash = capability_info(2, 1, 2), by_mask = capability_info(2, 2, 2);
-const wire_bytes odd_command = hex("000f 000d 0001 0004 0a000001 eeeeeeeeee"),
-                 odd_unknown = hex("0063 0003 eeeeee");
+const wire_bytes by_hash = capability_info(2, 1, 2), by_mask = capability_info(2, 2, 2),
+                 odd_unknown = hex("0063 0003 eeeeee"),
+                 odd_command = hex("000f 000d 0001 0004 0a000001 ee*5");
 
 bytes icu(uint32_t router, const wire_bytes &its_view, const std::vector<wire_bytes> &more = {by_hash}) {
     std::vector<wire_bytes> components = {security, service(), identity(router), its_view};
@@ -69,11 +66,10 @@ bytes query(uint32_t router, uint32_t target) {
         13, {security, service(), hex("0007 0010").ip(0, router).hex("00000099 0a000064").ip(0, target)});
 }
 
-class Messages : public testing::Test {
-protected:
+struct Messages : testing::Test {
     void SetUp() override {
-        engine.router_socket("10.0.0.1");
-        engine.router_socket("10.0.0.2");
+        for (const char *router : {"10.0.0.1", "10.0.0.2"})
+            engine.router_socket(router);
         group = engine.add_group(engine_fixture::group_config(51, {"10.0.0.1", "10.0.0.2"}));
         group->priority = 200;
         group->protocol = 6;
@@ -89,37 +85,34 @@ protected:
 
 // For each packet: the result, and all counters that it moves.
 TEST_F(Messages, EachFaultIsCountedInItsPlace) {
-    using counters = std::array<uint32_t, 8>;
     // all, group; I-See-Yous, failed; queries, failed; security mismatches, service mismatches
-    const counters none = {}, all = {1}, bad_option = {1, 1, 0, 0, 0, 0, 1};
-    const counters icu_alone = {0, 0, 1}, bad_icu = {0, 0, 1, 1}, bad_service = {0, 0, 1, 1, 0, 0, 0, 1};
-    const counters query_alone = {0, 0, 0, 0, 1}, bad_query = {0, 0, 0, 0, 1, 1};
+    const numbers none(8, 0), all = {1, 0, 0, 0, 0, 0, 0, 0}, bad_option = {1, 1, 0, 0, 0, 0, 1, 0},
+                              icu_alone = {0, 0, 1, 0, 0, 0, 0, 0}, bad_icu = {0, 0, 1, 1, 0, 0, 0, 0},
+                              bad_service = {0, 0, 1, 1, 0, 0, 0, 1}, query_alone = {0, 0, 0, 0, 1, 0, 0, 0},
+                              bad_query = {0, 0, 0, 0, 1, 1, 0, 0};
     const bytes good = icu(1, view(1, {{100, 100, 0}}));
-    const wire_bytes no_view = view(1, {});
     const auto changed = [&good](size_t at, uint8_t value) {
         bytes out = good;
         out.at(at) = value;
         return out;
     };
     const auto with = [](const std::vector<wire_bytes> &components) { return wire_message(11, components); };
-    bytes longer = good, router_0 = icu(0, no_view);
+    const auto optional = [](const std::vector<wire_bytes> &more) { return icu(1, view(1, {}), more); };
+    bytes longer = good, router_0 = icu(0, view(1, {}));
     longer.push_back(0);
     memset(&router_0[8 + 8 + 28 + 4], 0, 4);
     const struct {
         bytes message;
         int result;
-        counters moved;
+        numbers moved;
         std::string line;
         std::string reason = "message-malformed 10.0.0.1: "; // part of the reasons
     } rows[] = {
-        {bytes(7, 0), 1, all, "WCCP: unloading msg header failed.",
-         "message-malformed 10.0.0.1: a header of 7 bytes|8 bytes"},
+        {bytes(7, 0), 1, all, "WCCP: unloading msg header failed.", "10.0.0.1: a header of 7 bytes|8 bytes"},
         {longer, 0, none, "do not match. sender ip: 10.0.0.1",
          "message-length 10.0.0.1: 168 bytes by its header|169 bytes were received"},
         {bytes(good.begin(), good.end() - 1), 0, none,
-         "WCCP: message header length (160) and actual packet length (167) do not match. sender ip: "
-         "10.0.0.1",
-         "message-length"},
+         "header length (160) and actual packet length (167) do not match. sender ip: 10.0.0.1", "-length"},
         {changed(4, 1), 0, none, "WCCP rxed verion (256) is not supported. sender ip: 10.0.0.1",
          "message-version 10.0.0.1: 0x100|0x200"},
         {changed(3, 10), 0, none, "10.0.0.1", "message-type 10.0.0.1: type 10|11 or 13"}, // a Here-I-Am
@@ -138,46 +131,39 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
          "200, protocol: rxed = 17 local = 6, service flags: rxed = 0x3 local =  0x13",
          "service-mismatch 10.0.0.1: priority 201, protocol 17, flags 0x3|priority 200, protocol 6, flags "
          "0x13"},
-        {with({security, service(51, 199), identity(1)}), 0, bad_service, "config mismatch",
-         "service-mismatch"},
-        {with({security, service(51, 200, 17), identity(1)}), 0, bad_service, "config mismatch",
-         "service-mismatch"},
+        {with({security, service(51, 199), identity(1)}), 0, bad_service, "config mismatch", "service-"},
+        {with({security, service(51, 200, 17), identity(1)}), 0, bad_service, "mismatch", "service-"},
         {with({security, service(51, 200, 6, 0x80000013), identity(1)}), 0, bad_service, "config mismatch"},
-        {icu(1, no_view, {hex("000e 0000")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
-        {icu(1, no_view, {hex("000f 0000")}), 0, bad_icu, "WCCP: unloading command ext comp. failed."},
-        {icu(1, no_view, {hex("0008 0004 00000000")}), 0, bad_icu,
-         "WCCP: unloading capability comp. failed."},
-        {icu(1, no_view, {hex("0063 0001")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
-        {icu(1, no_view, {hex("00")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
-        {icu(1, no_view, {hex("0063")}), 0, bad_icu, "component type: 99 length 0 "},
-        {icu(1, no_view, {hex("0063 00")}), 0, bad_icu, "component type: 99 length 0 "},
-        {icu(1, no_view, {hex("000e 00")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
-        {icu(1, no_view, {by_hash, odd_command, odd_unknown, odd_unknown}), 0, bad_icu,
+        {optional({hex("000e 0000")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
+        {optional({hex("000f 0000")}), 0, bad_icu, "WCCP: unloading command ext comp. failed."},
+        {optional({hex("0008 0004 00000000")}), 0, bad_icu, "WCCP: unloading capability comp. failed."},
+        {optional({hex("0063 0001")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
+        {optional({hex("00")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
+        {optional({hex("0063")}), 0, bad_icu, "component type: 99 length 0 "},
+        {optional({hex("0063 00")}), 0, bad_icu, "component type: 99 length 0 "},
+        {optional({hex("000e 00")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
+        {optional({by_hash, odd_command, odd_unknown, odd_unknown}), 0, bad_icu,
          "WCCP GRP 51: ICU bogus packet  (too many optional components).",
          "message-malformed 10.0.0.1: 4 optional components|3 at most"},
-        {icu(1, no_view, {}), 0, icu_alone, "incompatible capabilities",
-         "forwarding-not-offered 10.0.0.1: gre|L2"},
-        {icu(1, no_view, {capability_info(2, 1, 0)}), 0, bad_icu, "incompatible capabilities",
+        {optional({}), 0, icu_alone, "incompatible capabilities", "forwarding-not-offered 10.0.0.1: gre|L2"},
+        {optional({capability_info(2, 1, 0)}), 0, bad_icu, "incompatible capabilities",
          "return-not-offered 10.0.0.1: none|gre or L2"},
         {router_0, 0, icu_alone, "", "router-id-zero: |"},
         {wire_message(13, {security, service()}), 0, bad_query, "WCCP: unloading router query failed."},
-        {query(1, 100), 0, query_alone,
-         "WCCP GRP 51: removal query request. cannot find router. (router id 10.0.0.1)",
+        {query(1, 100), 0, query_alone, "removal query request. cannot find router. (router id 10.0.0.1)",
          "query-refused 10.0.0.1: a query before an I-See-You|"},
         {query(1, 101), 0, query_alone,
-         "WCCP GRP 51: removal query is not for us. sending router id: 10.0.0.1 target appliance: "
-         "10.0.0.101",
-         ""},
+         "not for us. sending router id: 10.0.0.1 target appliance: 10.0.0.101", ""},
     };
     const auto now = [this] {
-        return counters{wccp_g.rx_failures,        group->rx_failures,          group->rx_icus,
-                        group->rx_icu_failures,    group->rx_removal_queries,   group->rx_removal_failures,
-                        group->rx_auth_mismatches, group->rx_service_mismatches};
+        return numbers{wccp_g.rx_failures,        group->rx_failures,          group->rx_icus,
+                       group->rx_icu_failures,    group->rx_removal_queries,   group->rx_removal_failures,
+                       group->rx_auth_mismatches, group->rx_service_mismatches};
     };
     log_lines log;
     for (const auto &row : rows) {
         SCOPED_TRACE("row " + std::to_string(&row - rows));
-        counters expected = now();
+        numbers expected = now();
         for (size_t i = 0; i < expected.size(); i++)
             expected[i] += row.moved[i];
         log.take();
@@ -189,14 +175,12 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         EXPECT_EQ(reasons.empty(), row.reason.empty()) << reasons;
         const std::string lines = log.take();
         EXPECT_NE(lines.find(row.line), std::string::npos) << lines;
-        EXPECT_EQ(lines.find("WCCP processing received packet from 10.0.0.1 failed") != std::string::npos,
-                  row.result == 1);
+        EXPECT_EQ(count_of("processing received packet from 10.0.0.1 failed", lines), row.result);
     }
-    const counters before = now();
+    const numbers before = now();
     for (const uint32_t state : {0u, WCCP_ADMIN_DOWN + 0u}) {
         group->admin_state = state;
-        EXPECT_EQ(process(good), 0);
-        EXPECT_TRUE(log.say("WCCP GRP 51: is disabled. dropping the rxed packet."));
+        EXPECT_TRUE(process(good) == 0 && log.say("WCCP GRP 51: is disabled. dropping the rxed packet."));
         EXPECT_EQ(now(), before);
     }
     group->admin_state = WCCP_ADMIN_UP;
@@ -218,16 +202,9 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
         }
         pass_seconds(seconds);
         lines += log.take();
-        std::istringstream split(lines);
-        std::string line, suppressed;
-        int count = 0;
-        while (std::getline(split, line)) {
-            count += line.find("unloading") != std::string::npos ||
-                     line.find("received packet") != std::string::npos;
-            if (const size_t at = line.find("wan0: "); at != std::string::npos)
-                suppressed = " " + line.substr(at, line.find(" more", at) - at);
-        }
-        return std::to_string(count) + suppressed;
+        const size_t at = lines.rfind("wan0: ");
+        return std::to_string(count_of("unloading", lines) + count_of("received packet", lines)) +
+               (at == std::string::npos ? "" : " " + lines.substr(at, lines.find(" more", at) - at));
     };
     wccp_interface *const wan0 = engine.interface;
     EXPECT_EQ(lines_of(wan0, 150, 1), "200"); // the burst
@@ -256,51 +233,49 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
 
 // Failures while a valid packet is processed can be repeated as often as invalid packets.
 TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
-    const auto report = [](uint32_t id, uint32_t weight, uint32_t also = 0) {
-        wire_bytes its_view = view(id, {{100, weight, 0}});
-        if (also)
-            its_view = view(id, {{also, 1, 0}, {100, weight, 0}});
-        return icu(id, its_view, {by_mask});
+    const auto report = [](uint32_t id, uint32_t weight, std::vector<element> seen = {}) {
+        seen.push_back({100, weight, 0});
+        return icu(id, view(id, seen), {by_mask});
     };
     process(report(1, 100));
     process(report(2, 100));
     group->mask_bits = WCCP_MAX_MASK_BITS + 1;
     pass_seconds(1);
     ASSERT_EQ(group->designated, 1u);
-    const struct {
-        const char *line;
-        std::function<bytes(uint32_t)> packet;
-        uint32_t more_appliances; // than exist
-    } rows[] = {
-        {"mask assignment: too many bits", [&](uint32_t i) { return report(1, i % 2 + 1); }, 0},
+    const uint32_t appliances = group->appliance_view_count;
+    const std::pair<const char *, std::function<bytes(uint32_t)>> rows[] = {
+        {"mask assignment: too many bits", [&](uint32_t i) { return report(1, i % 2 + 1); }},
         {"is not in all sending router views",
-         [&](uint32_t i) { return report(1, i % 2 + 1, 101 + i % 100); }, 0},
+         [&](uint32_t i) {
+             return report(1, i % 2 + 1, {{101 + i % 100, 1, 0}});
+         }},
         {"failed to add tunnel",
          [this](uint32_t i) {
              group->ret_method = WCCP_METHOD_GRE;
              return icu(3 + i % 60, view(3, {}), {capability_info(2, 2, 1)});
-         },
-         0},
-        {"here-i-am: loading web-cache view info failed.", [](uint32_t) { return query(1, 100); }, 1000},
+         }},
+        {"here-i-am: loading web-cache view info failed.",
+         [this](uint32_t) {
+             group->appliance_view_count = 1000; // more than exist
+             return query(1, 100);
+         }},
     };
     log_lines log;
     lc_log_set_daemon_log_level(LC_LOG_NOTICE);
-    for (const auto &row : rows) {
-        group->appliance_view_count += row.more_appliances;
+    for (const auto &[line, packet] : rows) {
         wccp_interface wan0 = {};
         int with_line = 0, lines = 0;
         for (uint32_t i = 0; i < 400; i++) {
             const wccp_complaint_scope complaints(&wan0);
-            process(row.packet(i));
+            process(packet(i));
             const std::string logged = log.take();
-            with_line += logged.find(row.line) != std::string::npos;
-            for (size_t at = 0; (at = logged.find("TID ", at)) != std::string::npos; at++)
-                lines++;
+            with_line += count_of(line, logged) > 0;
+            lines += count_of("TID ", logged);
         }
-        EXPECT_GT(with_line, 50) << row.line;
-        EXPECT_LE(lines, 200) << row.line;
-        group->appliance_view_count -= row.more_appliances;
+        EXPECT_GT(with_line, 50) << line;
+        EXPECT_LE(lines, 200) << line;
     }
+    group->appliance_view_count = appliances;
 }
 
 TEST_F(Messages, ATruncatedISeeYouLeavesTheGroupUnchanged) {
@@ -320,7 +295,6 @@ TEST_F(Messages, ATruncatedISeeYouLeavesTheGroupUnchanged) {
         const auto before = std::make_unique<wccp_service_group>(*group);
         const wccp_sending_router router_before = *router(2);
         EXPECT_EQ(process(cut), 0);
-        EXPECT_EQ(group->rx_icu_failures, before->rx_icu_failures + 1) << length;
         before->rx_icus++;
         before->rx_icu_failures++;
         memcpy(before->reasons, group->reasons, sizeof group->reasons);
@@ -328,18 +302,16 @@ TEST_F(Messages, ATruncatedISeeYouLeavesTheGroupUnchanged) {
         EXPECT_EQ(memcmp(&router_before, router(2), sizeof router_before), 0) << length;
         refused++;
     }
-    EXPECT_GT(refused, 200u);
-    EXPECT_EQ(process(whole), 0);
-    EXPECT_NE(router(1), nullptr);
+    EXPECT_TRUE(refused > 200 && process(whole) == 0 && router(1));
 }
 
 TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
     wccp_g.seconds = 77;
+    constexpr uint32_t L2 = WCCP_METHOD_L2, HASH = WCCP_ASSIGN_HASH;
     const wire_bytes seen = view(1, {{100, 100, 0x01}, {101, 50, 0xff}}, 5);
     // Odd lengths put the capabilities at odd addresses.
     EXPECT_EQ(process(icu(1, seen, {odd_unknown, odd_command, by_hash}), ipa(7, 7)), 0);
     EXPECT_EQ(take_reasons(group), "");
-    EXPECT_EQ(group->rx_icu_failures, 0u);
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
     const auto now = [&] {
@@ -350,15 +322,13 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
                        group->assign_method,       group->rx_service_mismatches,
                        group->rx_icu_failures};
     };
-    EXPECT_EQ(now(),
-              (numbers{0xa1a2a3a4, 0xc1c2c3c4, 77, 1, 2, 32, 256, WCCP_METHOD_L2, WCCP_ASSIGN_HASH, 0, 0}));
+    EXPECT_EQ(now(), (numbers{0xa1a2a3a4, 0xc1c2c3c4, 77, 1, 2, 32, 256, L2, HASH, 0, 0}));
     EXPECT_EQ(made->src_ipa, ipa(7, 7));
-    EXPECT_TRUE(made->flags & WCCP_RTR_TWO_WAY);
-    EXPECT_TRUE(group->state_flags & WCCP_STATE_ACTIVE);
+    EXPECT_TRUE(made->flags & WCCP_RTR_TWO_WAY && group->state_flags & WCCP_STATE_ACTIVE);
     // Another service is only counted.
     wccp_g.seconds = 78;
     EXPECT_EQ(process(wire_message(11, {security, service(51, 1), identity(1, 9), view(1, {})})), 0);
-    EXPECT_EQ(now(), (numbers{9, 0xc1c2c3c4, 78, 1, 0, 0, 0, WCCP_METHOD_L2, WCCP_ASSIGN_HASH, 1, 0}));
+    EXPECT_EQ(now(), (numbers{9, 0xc1c2c3c4, 78, 1, 0, 0, 0, L2, HASH, 1, 0}));
 }
 
 TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
@@ -368,7 +338,6 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     EXPECT_EQ(take_reasons(group),
               "mask-differs 10.0.0.1: src 0x1741 dst 0xf00 ports 0x1 0x2|src 0x0 dst 0x0 "
               "ports 0x0 0x0");
-    EXPECT_EQ(group->rx_icu_failures, 0u);
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
     const auto bits = [made](uint32_t entry) {
@@ -380,11 +349,8 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
                        made->total_buckets, made->view_appliances[0].buckets_assigned,
                        made->view_appliances[0].buckets_total, made->view_appliance_count}),
               (numbers{0x1741, 0xf00, 0, 4, 10, 4, 10, 2}));
-    EXPECT_EQ(bits(0), 0b1000100011);
-    EXPECT_EQ(bits(1), 0b0111000100);
-    EXPECT_TRUE(group->state_flags & WCCP_STATE_ACTIVE);
-
-    EXPECT_FALSE(made->map_in_order);
+    EXPECT_TRUE(bits(0) == 0b1000100011 && bits(1) == 0b0111000100 && !made->map_in_order);
+    EXPECT_TRUE(group->state_flags & WCCP_STATE_ACTIVE && group->rx_icu_failures == 0);
 
     // The next map replaces it. Even with the group's masks the values can be in another order.
     group->mask_src_ip = 0x41;
@@ -405,12 +371,13 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
 
     // A map without mask elements is refused, alone or after a full one, after the views have been updated.
     const wire_bytes empty = hex("000e 0024 00000000"), rest = hex("0063 001c").zeros(28);
-    EXPECT_EQ(process(icu(1, mask_view(1, {100}), {empty, rest})), 0);
-    EXPECT_EQ(group->rx_icu_failures, 1u);
-    EXPECT_TRUE(made->view_appliance_count == 1 && made->self_buckets == 1);
-    EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {map({100, 100}), empty, rest})), 0);
-    EXPECT_EQ(group->rx_icu_failures, 2u);
-    EXPECT_TRUE(made->view_appliance_count == 2 && made->self_buckets == 1);
+    const bytes messages[] = {icu(1, mask_view(1, {100}), {empty, rest}),
+                              icu(1, mask_view(1, {100, 101}), {map({100, 100}), empty, rest})};
+    for (uint32_t i = 0; i < 2; i++) {
+        EXPECT_EQ(process(messages[i]), 0);
+        EXPECT_TRUE(group->rx_icu_failures == i + 1 && made->view_appliance_count == i + 1 &&
+                    made->self_buckets == 1);
+    }
 
     // Hash elements when mask was agreed.
     take_reasons(group);
@@ -427,14 +394,11 @@ TEST_F(Messages, AMapThatFillsThePacketIsProcessed) {
     const wire_bytes filler = hex("0063").u16(static_cast<uint32_t>(rest)).zeros(rest);
     bytes message = icu(1, mask_view(1, {100, 101}), {by_mask, map(owners), filler});
     ASSERT_EQ(message.size(), size_t{WCCP_MAX_PACKET});
-    EXPECT_EQ(process(message), 0);
-    EXPECT_EQ(group->rx_icu_failures, 0u);
-    ASSERT_NE(router(1), nullptr);
-    EXPECT_EQ(router(1)->self_buckets, 1);
-    EXPECT_EQ(router(1)->total_buckets, owners.size());
+    ASSERT_TRUE(process(message) == 0 && router(1));
+    EXPECT_EQ(std::tuple(router(1)->self_buckets, router(1)->total_buckets, group->rx_icu_failures),
+              std::tuple(1, owners.size(), 0));
     message[7]++; // the header of a longer message, truncated to the buffer: dropped and not counted
-    EXPECT_EQ(process(message), 0);
-    EXPECT_TRUE(group->rx_icus == 1 && wccp_g.rx_failures == 0);
+    EXPECT_TRUE(process(message) == 0 && group->rx_icus == 1 && wccp_g.rx_failures == 0);
 }
 
 TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
@@ -446,27 +410,23 @@ TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
     pass_seconds(1);
     ASSERT_EQ(group->designated, 1u);
     const uint32_t key = group->dsg_key_change;
-    const struct {
-        uint32_t seconds, assignments; // that have been sent by then
-        uint8_t router;
-        uint32_t key;
-        bool acked;
-        uint8_t pending, timer;
-        uint32_t key_address = 100;
-    } steps[] = {
-        {15, 1, 1, key, false, 2, 1}, // the first assignment alone does not count
-        {10, 2, 1, key - 1, false, 2, 1}, {0, 2, 1, key, false, 2, 1, 101}, // another appliance's key
-        {0, 2, 1, key, true, 1, 1},       {0, 2, 1, key, true, 1, 1},       // one router acknowledges once
-        {0, 2, 2, key, true, 0, 0},
+    // Seconds that pass, router, key and its appliance; then assignments sent, acknowledged, pending, timer.
+    const std::tuple<uint32_t, uint8_t, uint32_t, uint32_t, uint32_t, bool, int, int> steps[] = {
+        {15, 1, key, 100, 1, false, 2, 1}, // the first assignment alone does not count
+        {10, 1, key - 1, 100, 2, false, 2, 1},
+        {0, 1, key, 101, 2, false, 2, 1}, // another appliance's key
+        {0, 1, key, 100, 2, true, 1, 1},
+        {0, 1, key, 100, 2, true, 1, 1}, // one router acknowledges once
+        {0, 2, key, 100, 2, true, 0, 0},
     };
-    for (const auto &step : steps) {
-        pass_seconds(step.seconds);
-        report(step.router, step.key, step.key_address);
-        EXPECT_EQ(group->tx_redirect_assign, step.assignments);
-        EXPECT_EQ(!(router(step.router)->flags & WCCP_RTR_ASSIGN_UNACKED), step.acked);
-        EXPECT_TRUE(group->pending_acks == step.pending && group->assign_timer.active == step.timer);
-        const std::string reasons = take_reasons(group), wanted = "|table 10.0.0.100 number 1";
-        EXPECT_EQ(reasons.find(wanted) != std::string::npos, step.assignments > 1 && !step.acked) << reasons;
+    for (const auto &[seconds, id, its_key, owner, assignments, acked, pending, timer] : steps) {
+        pass_seconds(seconds);
+        report(id, its_key, owner);
+        EXPECT_EQ(std::tuple(group->tx_redirect_assign, !(router(id)->flags & WCCP_RTR_ASSIGN_UNACKED),
+                             group->pending_acks, group->assign_timer.active),
+                  std::tuple(assignments, acked, pending, timer));
+        const std::string reasons = take_reasons(group);
+        EXPECT_EQ(count_of("|table 10.0.0.100 number 1", reasons), assignments > 1 && !acked) << reasons;
     }
     // With no acknowledgements pending, the timer stops and the count does not wrap.
     router(1)->flags |= WCCP_RTR_ASSIGN_UNACKED;
@@ -482,8 +442,7 @@ TEST_F(Messages, TheDigestDecides) {
     const wire_bytes signature = hex("0000 0014 00000001 3f928e4227816919a09d11fd2b70f0f2");
     const bytes good = wire_message(
         11, {signature, service(), identity(1), view(1, {{100, 100, 0}}, 7), capability_info(2, 3, 2)});
-    EXPECT_EQ(process(good), 0);
-    EXPECT_NE(router(1), nullptr);
+    EXPECT_TRUE(process(good) == 0 && router(1));
     for (const size_t at : {size_t{16}, size_t{31}, size_t{40}, good.size() - 1}) {
         bytes changed = good;
         changed[at] ^= 1;
@@ -498,8 +457,7 @@ TEST_F(Messages, TheDigestDecides) {
                                 "security-unwanted 10.0.0.1: MD5|none";
     EXPECT_EQ(take_reasons(group), reasons);
     // An accepted I-See-You ends them, except those of the same second and those of other senders.
-    EXPECT_EQ(process(good), 1);
-    EXPECT_EQ(process(good, ipa(0, 2)), 1);
+    EXPECT_TRUE(process(good) == 1 && process(good, ipa(0, 2)) == 1);
     for (uint32_t second = 0; second < 2; second++, wccp_g.seconds++)
         process(icu(1, view(1, {{100, 100, 0}})));
     EXPECT_EQ(take_reasons(group),
@@ -509,9 +467,8 @@ TEST_F(Messages, TheDigestDecides) {
     for (uint8_t i = 0; i < 100; i++, wccp_g.seconds++)
         process(good, ipa(7, i));
     const std::string all = take_reasons(group);
-    EXPECT_NE(all.find("unwanted 10.0.0.1: "), std::string::npos) << all;
-    EXPECT_EQ(all.find("10.0.7.0:"), std::string::npos) << all;
-    EXPECT_NE(all.find("10.0.7.99:"), std::string::npos) << all;
+    EXPECT_EQ(count_of("unwanted 10.0.0.1: ", all) + count_of("10.0.7.99:", all), 2) << all;
+    EXPECT_EQ(count_of("10.0.7.0:", all), 0) << all;
     EXPECT_EQ((numbers{group->rx_auth_failures, group->rx_auth_mismatches, group->rx_failures,
                        wccp_g.rx_failures, group->rx_icus}),
               (numbers{5, 2 + 103, 7 + 103, 7 + 103, 1 + 2}));
@@ -523,35 +480,29 @@ TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
         group->weight = weight;
         EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, 10), 0);
         const bytes sent = engine.sent_to("10.0.0.1");
-        ASSERT_EQ(sent.size(), 108u);
-        EXPECT_EQ(sent[8 + 8 + 28 + 45], weight);
+        ASSERT_TRUE(sent.size() == 108 && sent[8 + 8 + 28 + 45] == weight);
         EXPECT_EQ(sent, engine.sent_to("10.0.0.2"));
     }
     // By kind and readiness: the result, and the counters: Here-I-Am, Redirect-Assign, failed builds,
     // failures, link drops. An attempt is counted before it is built.
-    const struct {
-        uint32_t kind, ready, bound;
-        int result;
-        numbers counted;
-    } rows[] = {
+    const std::tuple<uint32_t, uint32_t, uint32_t, int, numbers> rows[] = {
         {12, 3, 1, 1, {2, 1, 1, 1, 0}}, {11, 3, 1, 1, {2, 1, 1, 2, 0}}, {10, 3, 0, 1, {3, 1, 1, 3, 0}},
         {10, 0, 1, 0, {3, 1, 1, 3, 1}}, {12, 1, 1, 0, {3, 1, 1, 3, 2}}, {25, 2, 1, 0, {3, 1, 1, 3, 3}},
         {99, 2, 1, 0, {3, 1, 1, 3, 4}},
     };
-    for (const auto &row : rows) {
-        engine.interface->ready_flags = row.ready;
-        engine.interface->ucast_bound = row.bound;
-        EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, row.kind), row.result);
+    for (const auto &[kind, ready, bound, result, counted] : rows) {
+        engine.interface->ready_flags = ready;
+        engine.interface->ucast_bound = bound;
+        EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, kind), result);
         EXPECT_EQ((numbers{group->tx_here_i_am, group->tx_redirect_assign, group->tx_build_failures,
                            group->tx_failures, group->tx_link_drops}),
-                  row.counted);
+                  counted);
     }
     engine.interface->ready_flags = WCCP_ALL_READY;
     group->tx_pkt->ipa = {{255, 255, 255, 255}}; // refused by the kernel: only a result of 0 is a failure
     EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, 25), 0);
-    EXPECT_EQ(group->tx_removal_replies, 1u);
     EXPECT_EQ(wccp_transmit_packet(group, nullptr, 10), 1);
-    EXPECT_EQ(group->tx_failures, 3u);
+    EXPECT_TRUE(group->tx_removal_replies == 1 && group->tx_failures == 3);
     EXPECT_EQ(take_reasons(group), "table-not-built: redirect assign: groups actual assignment method is "
                                    "not set.|; send-failed 255.255.255.255: Permission denied|108 bytes");
     EXPECT_EQ(engine.sent_to("10.0.0.1"), bytes{});

@@ -56,8 +56,7 @@ wire_bytes view(uint32_t routers = 0, uint32_t addresses = 0, uint32_t appliance
         out.add(element);
     return out.put16(2, static_cast<uint32_t>(static_cast<int>(out.size()) - 4 + length_error));
 }
-class Unload : public testing::Test {
-protected:
+struct Unload : testing::Test {
     void SetUp() override {
         group.id = 51;
         group.compat_mode = WCCP_COMPAT_IOS;
@@ -83,10 +82,7 @@ protected:
 
 // Every component is refused at every length below its own.
 TEST_F(Unload, TruncatedComponentsAreRefused) {
-    const struct {
-        reader read;
-        wire_bytes bytes;
-    } rows[] = {
+    const std::pair<reader, wire_bytes> rows[] = {
         {read_header, hex("0000000b 0200 0064")},
         {read_security, hex("0000 0004 00000000")},
         {read_security, hex("0000 0014 00000001 77*16")},
@@ -107,13 +103,14 @@ TEST_F(Unload, TruncatedComponentsAreRefused) {
         {read_unknown, hex("0063 0000")},
         {read_unknown, hex("0063 0007 01*7")},
     };
-    for (size_t row = 0; row < std::size(rows); row++)
+    for (const auto &[read, whole] : rows)
         for (const uint32_t shift : {0u, 1u, 3u}) {
-            wire_bytes cut = rows[row].bytes;
-            EXPECT_EQ(passed(rows[row].read, cut, shift), static_cast<int>(cut.size())) << "row " << row;
+            SCOPED_TRACE(testing::PrintToString(whole.bytes));
+            wire_bytes cut = whole;
+            EXPECT_EQ(passed(read, cut, shift), static_cast<int>(cut.size()));
             while (!cut.bytes.empty()) {
                 cut.bytes.pop_back();
-                EXPECT_EQ(passed(rows[row].read, cut, shift), -1) << "row " << row << " at " << cut.size();
+                EXPECT_EQ(passed(read, cut, shift), -1) << cut.size();
             }
         }
 }
@@ -122,11 +119,8 @@ TEST_F(Unload, TruncatedComponentsAreRefused) {
 TEST_F(Unload, RefusalsAndTheirLines) {
     const std::string bad_map =
         "unload assignment map: packet length is BAD or it has bogus values. rxed len: ";
-    const struct {
-        reader read;
-        wire_bytes bytes;
-        std::string line; // after "WCCP GRP 51: " unless it begins with a W; empty: nothing is logged
-    } rows[] = {
+    // The line after "WCCP GRP 51: " unless it begins with a W; empty: nothing is logged.
+    const std::tuple<reader, wire_bytes, std::string> rows[] = {
         {read_security, hex("0003 0004 00000000"), "WCCP: expected security componenet. rxed 3"},
         {read_security, hex("0000 0008 00000000 00*16"), ""},
         {read_security, hex("0000 0015 00000001 00*20"), ""},
@@ -138,8 +132,7 @@ TEST_F(Unload, RefusalsAndTheirLines) {
         {read_identity, hex("0002 0018 07*12 00000003 07*8"), "full length does not fit in pkt"},
         {read_identity, hex("0002 0010 07*12 40000000 07*32"), "full length does not fit in pkt"},
         {read_identity, hex("0002 000c 07*12 ffffffff 07*32"), "full length does not fit in pkt"},
-        {read_identity, hex("0002 0014 07*12 00000002 07*8"),
-         "rxed length (20) and expected length (24) mismatch"},
+        {read_identity, hex("0002 0014 07*12 00000002 07*8"), "rxed length (20) and expected length (24)"},
         {read_view, hex("00*19"), "static component does not fit in pkt"},
         {read_view, view(0, 0, 0, {}, 5), "WCCP: bad router view type rxed (5)"},
         {read_view, view(33, 33), "bad number of routers (33) in ICU pkt. "},
@@ -149,8 +142,7 @@ TEST_F(Unload, RefusalsAndTheirLines) {
         {read_view, view(0, 0, 0x80000000), "bad number of appliances"},
         {read_view, view(0, 0, 4, {hash_element, hash_element, hash_element}),
          "# of appliances (4 x 44 bytes) does not fit in pkt length (0)"},
-        {read_view, view(0, 0, 1, {hex("00*43")}, 4, 1),
-         "# of appliances (1 x 44 bytes) does not fit in pkt length (0)"},
+        {read_view, view(0, 0, 1, {hex("00*43")}, 4, 1), "# of appliances (1 x 44 bytes) does not fit"},
         {read_view, view(0, 0, 1, {hash_element}, 4, -1),
          "bad length. rxed length 63 pkt length 64 (check compatibility mode (IOS/Nexus))"},
         {read_view, view(0, 0, 1, {mask_element}),
@@ -171,8 +163,7 @@ TEST_F(Unload, RefusalsAndTheirLines) {
          "capability component length is not aligned. length 12 individual element size 8"},
         {read_capabilities, hex("0008 0010 0001 0004 00000002"), ""},
         {read_command, hex("000f 0008 0001 0004 0000"), "no commands in pkt"},
-        {read_command, hex("000f 0009 0001 0004 00000000"),
-         "bogus component length (9): does not  fit in the packet."},
+        {read_command, hex("000f 0009 0001 0004 00000000"), "bogus component length (9): does not  fit"},
         {read_query, hex("00*19"), "router query comp. does not fit in packet."},
         {read_query, hex("0008 0010 00*16"), "bad router query type rxed (8)"},
         {read_query, hex("0007 0014 00*20"), "bad length. rxed length 20 pkt length 16"},
@@ -180,14 +171,12 @@ TEST_F(Unload, RefusalsAndTheirLines) {
          "unkown pkt length does not fit in the packet. component type: 99 length 5 "},
     };
     log_lines log;
-    for (size_t row = 0; row < std::size(rows); row++) {
-        EXPECT_EQ(passed(rows[row].read, rows[row].bytes), -1) << "row " << row;
-        const std::string lines = log.take(), line = rows[row].line;
-        if (!line.empty())
-            EXPECT_NE(lines.find(line[0] == 'W' ? line : "WCCP GRP 51: " + line), std::string::npos)
-                << "row " << row << ": " << lines;
-        else
-            EXPECT_EQ(lines, "") << "row " << row;
+    for (const auto &[read, message, line] : rows) {
+        EXPECT_EQ(passed(read, message), -1) << line;
+        const std::string lines = log.take();
+        EXPECT_TRUE(line.empty() ? lines.empty()
+                                 : count_of(line[0] == 'W' ? line : "WCCP GRP 51: " + line, lines) > 0)
+            << line << lines;
     }
     EXPECT_EQ(group.rx_unknown_capabilities, 0u);
 }
@@ -197,50 +186,40 @@ TEST_F(Unload, SecurityHasItsDigestInThePacket) {
     uint8_t *digest;
     received_packet pkt = at(hex("0000 0014 00000001 77*16 00*4"));
     EXPECT_EQ(wccp_pkt_unload_security_info_component(pkt.get(), &info, &digest), 0);
-    EXPECT_EQ(digest, pkt->data + 8);
-    EXPECT_EQ(pkt->offset, 24u);
+    EXPECT_TRUE(digest == pkt->data + 8 && pkt->offset == 24);
     for (const uint32_t length : {0u, 2u, 4u}) { // a shorter length passes
         pkt = at(wire_bytes().u16(0).u16(length).hex("00000002 00*16"));
         EXPECT_EQ(wccp_pkt_unload_security_info_component(pkt.get(), &info, &digest), 0);
-        EXPECT_EQ(digest, nullptr);
-        EXPECT_EQ(to_host(info->option), 2u);
-        EXPECT_EQ(pkt->offset, 8u);
+        EXPECT_TRUE(!digest && to_host(info->option) == 2 && pkt->offset == 8);
     }
 }
 
 // The compatibility mode only decides the form of one element.
 TEST_F(Unload, TheFormOfAnElementFollowsFlagsAndMode) {
-    const struct {
-        uint16_t flags;
-        uint32_t mode;
-        wccp_element_shape shape;
-    } rows[] = {
-        {0, 1, {WCCP_ELEMENT_HASH, 44, 40}},        {0, 2, {WCCP_ELEMENT_HASH, 44, 40}},
-        {1, 1, {WCCP_ELEMENT_HASH, 44, 40}},        {0x80, 2, {WCCP_ELEMENT_HASH, 44, 40}},
-        {3, 1, {WCCP_ELEMENT_NO_REDIRECT, 32, 28}}, {3, 2, {WCCP_ELEMENT_NO_REDIRECT, 32, 28}},
-        {2, 1, {WCCP_ELEMENT_REDIRECT, 16, 12}},    {2, 2, {WCCP_ELEMENT_REDIRECT, 32, 28}},
-    };
-    for (const auto &row : rows) {
-        const wccp_element_shape shape = wccp_view_element_shape(row.flags, row.mode);
-        EXPECT_TRUE(shape.form == row.shape.form && shape.size == row.shape.size &&
-                    shape.weight_at == row.shape.weight_at)
-            << row.flags << " in mode " << row.mode;
+    // Flags and mode; form, size, and place of the weight.
+    const std::tuple<uint16_t, uint32_t, int, uint32_t, uint32_t> rows[] = {
+        {0, 1, WCCP_ELEMENT_HASH, 44, 40},        {0, 2, WCCP_ELEMENT_HASH, 44, 40},
+        {1, 1, WCCP_ELEMENT_HASH, 44, 40},        {0x80, 2, WCCP_ELEMENT_HASH, 44, 40},
+        {3, 1, WCCP_ELEMENT_NO_REDIRECT, 32, 28}, {3, 2, WCCP_ELEMENT_NO_REDIRECT, 32, 28},
+        {2, 1, WCCP_ELEMENT_REDIRECT, 16, 12},    {2, 2, WCCP_ELEMENT_REDIRECT, 32, 28}};
+    for (const auto &[flags, mode, form, size, weight_at] : rows) {
+        const wccp_element_shape shape = wccp_view_element_shape(flags, mode);
+        EXPECT_EQ(std::tuple(flags, mode, static_cast<int>(shape.form), shape.size, shape.weight_at),
+                  std::tuple(flags, mode, form, size, weight_at));
     }
     const wire_bytes ios = view(0, 0, 1, {short_element}), nexus = view(0, 0, 1, {mask_element});
-    EXPECT_EQ(passed(read_view, ios), 40);
-    EXPECT_EQ(passed(read_view, nexus), -1);
+    EXPECT_TRUE(passed(read_view, ios) == 40 && passed(read_view, nexus) == -1);
     group.compat_mode = WCCP_COMPAT_NEXUS;
-    EXPECT_EQ(passed(read_view, ios), -1);
-    EXPECT_EQ(passed(read_view, nexus), 56);
+    EXPECT_TRUE(passed(read_view, ios) == -1 && passed(read_view, nexus) == 56);
 }
 
 // --- Elements of a Router View
 
 const be32 OURS = {{10, 0, 0, 1}};
 
-wire_bytes element(uint32_t last_octet, uint32_t revision, uint32_t flags, const wire_bytes &middle,
+wire_bytes element(uint32_t octet, uint32_t revision, uint32_t flags, const wire_bytes &middle,
                    uint32_t weight) {
-    return wire_bytes().ip(0, last_octet).u16(revision).u16(flags).add(middle).u16(weight).u16(0);
+    return wire_bytes().ip(0, octet).u16(revision).u16(flags).add(middle).u16(weight).u16(0);
 }
 wire_bytes hash_form(uint32_t last_octet, uint32_t weight, wire_bytes buckets, uint32_t flags = 0,
                      uint32_t revision = 0) {
@@ -276,23 +255,17 @@ TEST_F(Unload, ElementsAreDecodedByTheirForm) {
     };
     const decoded_elements out = decode(&group, elements);
     ASSERT_EQ(out.result, 0);
-    EXPECT_EQ(out.hash.valid, 1u);
-    EXPECT_EQ(out.hash.self_count, 10);
-    EXPECT_EQ(out.hash.total_count, 256); // 266, limited
-    const struct {
-        uint16_t weight, assigned, total;
-    } expected[] = {{100, 10, 256}, {0x1234, 256, 256}, {7, 0, 0}, {44, 0, 0}};
+    EXPECT_TRUE(out.hash.valid == 1 && out.hash.self_count == 10 &&
+                out.hash.total_count == 256); // 266, limited
+    const std::tuple<uint16_t, uint16_t, uint16_t> expected[] = {
+        {100, 10, 256}, {0x1234, 256, 256}, {7, 0, 0}, {44, 0, 0}};
     for (uint8_t i = 0; i < 4; i++) {
         EXPECT_EQ(out.list[i].ipa, (be32{{10, 0, 0, static_cast<uint8_t>(i + 1)}}));
-        EXPECT_EQ(out.list[i].weight, expected[i].weight);
-        EXPECT_EQ(out.list[i].buckets_assigned, expected[i].assigned);
-        EXPECT_EQ(out.list[i].buckets_total, expected[i].total);
+        EXPECT_EQ(std::tuple(out.list[i].weight, out.list[i].buckets_assigned, out.list[i].buckets_total),
+                  expected[i]);
     }
-    EXPECT_EQ(out.list[0].bucket_bits[0], 0x80010000u);
-    EXPECT_EQ(out.list[0].bucket_bits[1], 0xff000000u);
-
-    EXPECT_EQ(decode(&group, {}).result, 0);
-    EXPECT_EQ(decode(&group, {}).hash.total_count, 0);
+    EXPECT_TRUE(out.list[0].bucket_bits[0] == 0x80010000 && out.list[0].bucket_bits[1] == 0xff000000);
+    EXPECT_EQ(decode(&group, {}).result + decode(&group, {}).hash.total_count, 0);
     // Another hash revision is refused, historical or not, and so are truncated elements and null arguments.
     EXPECT_EQ(decode(&group, {hash_form(1, 100, full), hash_form(2, 1, full, 0x80, 1)}).result, 1);
     for (const wire_bytes &last : elements)
@@ -309,12 +282,10 @@ TEST_F(Unload, AMaskElementWithRedirectLeavesTheAssignmentToTheMap) {
         group.compat_mode = mode;
         const wire_bytes middle = wire_bytes().zeros(mode == WCCP_COMPAT_IOS ? 4 : 20);
         const decoded_elements out =
-            decode(&group, {element(1, 0, 2, middle, 77), hash_form(2, 100, wire_bytes().hex("01"))});
+            decode(&group, {element(1, 0, 2, middle, 77), hash_form(2, 100, hex("01"))});
         ASSERT_EQ(out.result, 0);
-        EXPECT_EQ(out.hash.valid, 0u);
-        EXPECT_EQ(out.list[0].weight, 77);
+        EXPECT_TRUE(out.hash.valid == 0 && out.list[0].weight == 77 && out.list[1].buckets_assigned == 1);
         EXPECT_EQ(out.list[1].ipa, (be32{{10, 0, 0, 2}}));
-        EXPECT_EQ(out.list[1].buckets_assigned, 1);
     }
 }
 
@@ -341,17 +312,14 @@ TEST_F(Unload, AMapKeepsItsFirstMaskAndItsLastValues) {
     wccp_assign_map_info out = {};
     ASSERT_EQ(wccp_pkt_unload_assignment_map_component(&group, pkt.get(), &out), 0);
     EXPECT_TRUE(out.present == 1 && out.element_count == 2 && out.value_count == 2);
-    EXPECT_EQ(to_host(out.masks->mask.src_ip), 0x1741u);
-    EXPECT_EQ(to_host(out.values[1].value.src_ip), 3u);
+    EXPECT_TRUE(to_host(out.masks->mask.src_ip) == 0x1741 && to_host(out.values[1].value.src_ip) == 3);
     EXPECT_EQ(out.values[1].appliance_id, (be32{{10, 0, 0, 102}}));
     EXPECT_EQ(pkt->offset, 1u + 8 + 32 + 48);
 
     pkt = at(hex("000e 0024 00000000 11*12 00000009 55*16"));
     out = {};
     ASSERT_EQ(wccp_pkt_unload_assignment_map_component(&group, pkt.get(), &out), 0);
-    EXPECT_EQ(out.present, 1u);
-    EXPECT_EQ(out.values, nullptr);
-    EXPECT_EQ(pkt->offset, 8u);
+    EXPECT_TRUE(out.present == 1 && !out.values && pkt->offset == 8);
 }
 
 TEST_F(Unload, CapabilitiesTakeTheLastOfEachKind) {
@@ -361,8 +329,8 @@ TEST_F(Unload, CapabilitiesTakeTheLastOfEachKind) {
                              1);
     wccp_rtr_capabilities out = {1, 1, 1};
     ASSERT_EQ(wccp_pkt_unload_capability_info_component(&group, pkt.get(), &out), 0);
-    EXPECT_TRUE(out.forwarding == 0x103 && out.assignment == 3 && out.ret == 2);
-    EXPECT_EQ(group.rx_unknown_capabilities, 1u);
+    EXPECT_TRUE(out.forwarding == 0x103 && out.assignment == 3 && out.ret == 2 &&
+                group.rx_unknown_capabilities == 1);
     EXPECT_NE(log.take(), "") << "more than the three known capabilities are logged";
     pkt = at(hex("0008 0018 0001 0004 00000002 0002 0004 00000002 0003 0004 00000002"));
     ASSERT_EQ(wccp_pkt_unload_capability_info_component(&group, pkt.get(), &out), 0);

@@ -18,8 +18,7 @@ struct RouterTest : testing::Test, all_freed, reported_group {
         const int result = wccp_process_router_capabilities(group, ROUTER_A, &offered, &agreed, &compatible);
         if (!compatible)
             return -1 - result;
-        EXPECT_EQ(result, 0);
-        EXPECT_EQ(compatible, 1u);
+        EXPECT_TRUE(result == 0 && compatible == 1);
         return static_cast<int>(agreed.forwarding * 100 + agreed.assignment * 10 + agreed.ret);
     }
     void configure(uint32_t forwarding, uint32_t assignment) {
@@ -32,7 +31,6 @@ TEST_F(RouterTest, EachMethodIsAgreedByItsOwnRule) {
     // By local value and the two low bits of the offer; 0 for none in common.
     const int forwarding[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 2}, {0, 0, 0, 0}};
     const int assign_with_gre[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 1}, {0, 0, 0, 0}};
-    const int assign_with_l2[5][4] = {{0, 0, 0, 0}, {0, 1, 0, 1}, {0, 0, 2, 2}, {0, 1, 2, 2}, {0, 0, 0, 0}};
     const int returning[4] = {0, 1, 2, 1}; // not configurable
     for (uint32_t local = 0; local < 25; local++) {
         const uint32_t local_fwd = local / 5, local_assign = local % 5;
@@ -40,7 +38,7 @@ TEST_F(RouterTest, EachMethodIsAgreedByItsOwnRule) {
         for (uint32_t offer = 0; offer < 64; offer++) {
             const uint32_t fwd = offer & 3, assign = offer >> 2 & 3, ret = offer >> 4;
             const int f = forwarding[local_fwd][fwd];
-            const int a = (f == 2 ? assign_with_l2 : assign_with_gre)[local_assign][assign];
+            const int a = (f == 2 ? forwarding : assign_with_gre)[local_assign][assign]; // the same table
             const int r = returning[ret];
             const int expected = f == 0 || a == 0 ? -1 : r == 0 ? -2 : f * 100 + a * 10 + r;
             ASSERT_EQ(decide(fwd, assign, ret), expected);
@@ -91,10 +89,8 @@ TEST_F(RouterTest, WhatTheFirstRouterAgreedHoldsForAll) {
     EXPECT_EQ(decide(1, 3, 3), 111);
     router(ROUTER_A); // L2, hash, L2
     EXPECT_EQ(group->fwd_method * 100 + group->assign_method * 10 + group->ret_method, 212u);
-    EXPECT_EQ(decide(1, 3, 3), -1);
-    EXPECT_EQ(decide(2, 2, 3), -1);
-    EXPECT_EQ(decide(2, 3, 1), -2);
-    EXPECT_EQ(decide(3, 3, 3), 212);
+    EXPECT_EQ(std::tuple(decide(1, 3, 3), decide(2, 2, 3), decide(2, 3, 1), decide(3, 3, 3)),
+              std::tuple(-1, -1, -2, 212));
     configure(WCCP_METHOD_GRE, WCCP_ASSIGN_MASK);
     EXPECT_EQ(decide(3, 3, 3), 212);
     wccp_g.seconds += 40;
@@ -109,8 +105,7 @@ TEST_F(RouterTest, ANewRouterIsOneWayAndKeepsItsOffer) {
     EXPECT_EQ(wccp_create_sending_router(group, {}, &l2, &l2), nullptr);
     for (const wccp_rtr_capabilities *agreed : {&gre, &gre_return})
         EXPECT_EQ(wccp_create_sending_router(group, ROUTER_A, agreed, agreed), nullptr);
-    EXPECT_EQ(group->sending_router_count, 0u);
-    EXPECT_FALSE(group->state_flags & WCCP_CAPABILITIES_SET);
+    EXPECT_TRUE(group->sending_router_count == 0 && !(group->state_flags & WCCP_CAPABILITIES_SET));
 
     wccp_g.seconds = 77;
     const wccp_rtr_capabilities offered = {0x1fe, 0x302, 2};
@@ -131,19 +126,17 @@ TEST_F(RouterTest, ANewRouterIsOneWayAndKeepsItsOffer) {
 TEST_F(RouterTest, TheHoldTimeWorksAcrossTheWrapOfTheClock) {
     wccp_g.seconds = 0xfffffff0;
     router(ROUTER_A);
-    wccp_g.seconds += 39;
-    wccp_monitor_sending_routers(group);
-    EXPECT_EQ(group->sending_router_count, 1u);
-    wccp_g.seconds += 1;
-    wccp_monitor_sending_routers(group);
-    EXPECT_EQ(group->sending_router_count, 0u);
+    for (const uint32_t seconds : {39u, 1u}) {
+        wccp_g.seconds += seconds;
+        wccp_monitor_sending_routers(group);
+        EXPECT_EQ(group->sending_router_count, seconds == 39 ? 1u : 0u);
+    }
 }
 
 TEST_F(RouterTest, ARemovalDropsReferencesRedirectionAndLastTheAgreement) {
     for (const be32 id : {ROUTER_A, ROUTER_B, ROUTER_C})
         see(id, {id, ROUTER_A}, {{US, 100}, {id, 100}});
-    router(ROUTER_A)->self_buckets = 10;
-    router(ROUTER_B)->self_buckets = 10;
+    router(ROUTER_A)->self_buckets = router(ROUTER_B)->self_buckets = 10;
     group->redirecting_routers = 2;
     wccp_appliance_state_active(group);
     group->change_number = 0;
@@ -168,14 +161,14 @@ TEST_F(RouterTest, ARemovalDropsReferencesRedirectionAndLastTheAgreement) {
 
 TEST_F(RouterTest, RemovalQueriesOfTwoWayRoutersAreAnsweredUpToALimit) {
     router(ROUTER_A);
-    EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_B, host(77)), 0); // not known
-    EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_A, host(77)), 0); // one-way
-    EXPECT_EQ(group->removal_reply_count, 0u);
-    EXPECT_TRUE(is_zero(router(ROUTER_A)->receive_id));
+    const auto query = [this](be32 from, uint32_t receive_id) {
+        return wccp_process_router_removal_query(group, from, host(receive_id));
+    };
+    EXPECT_EQ(query(ROUTER_B, 77) + query(ROUTER_A, 77), 0); // not known, and one-way
+    EXPECT_TRUE(group->removal_reply_count == 0 && is_zero(router(ROUTER_A)->receive_id));
 
     see(ROUTER_A, {ROUTER_A}, {{US, 100}});
-    EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_A, host(77)), 0);
-    EXPECT_EQ(router(ROUTER_A)->receive_id, host(77));
+    EXPECT_TRUE(query(ROUTER_A, 77) == 0 && router(ROUTER_A)->receive_id == host(77));
     ASSERT_EQ(group->removal_reply_count, 1u);
     const wccp_pkt *pkt = &group->removal_replies->pkt;
     EXPECT_EQ(pkt->ipa, ROUTER_A);
@@ -184,42 +177,20 @@ TEST_F(RouterTest, RemovalQueriesOfTwoWayRoutersAreAnsweredUpToALimit) {
     see(ROUTER_A, {ROUTER_A, ROUTER_B}, {{US, 100}}); // the reply is not built again
     log_lines log;
     int answered = 1;
-    for (int query = 1; query < 100; query++)
-        answered += wccp_process_router_removal_query(group, ROUTER_A, host(78)) == 0;
+    for (int i = 1; i < 100; i++)
+        answered += query(ROUTER_A, 78) == 0;
     EXPECT_EQ(answered, 8);
     EXPECT_EQ(take_reasons(group), "query-refused 10.0.0.202: a query before an I-See-You|; query-refused "
                                    "10.0.0.201: one more query|8 replies waiting at most x93");
     EXPECT_TRUE(log.say("maximum of waiting replies (8) reached. (router id 10.0.0.201)"));
     see(ROUTER_B, {ROUTER_A}, {{US, 100}}); // the flood does not affect another router
-    EXPECT_EQ(wccp_process_router_removal_query(group, ROUTER_B, host(79)), 0);
+    EXPECT_EQ(query(ROUTER_B, 79), 0);
     pass_seconds(2);
     EXPECT_EQ(group->removal_reply_count, 9u);
     EXPECT_EQ(std::vector<uint8_t>(pkt->data, pkt->data + pkt->length), written);
     pass_seconds(2);
-    EXPECT_EQ(group->removal_replies, nullptr);
-    EXPECT_EQ(group->removal_reply_count, 0u);
+    EXPECT_TRUE(!group->removal_replies && group->removal_reply_count == 0);
     EXPECT_EQ(group->tx_removal_replies, 3u * 9);
-}
-
-TEST_F(RouterTest, QueriesAboutRouters) {
-    uint32_t one_way = 9, two_way = 9, buckets = 9;
-    router(ROUTER_A)->flags = WCCP_RTR_ONE_WAY | WCCP_RTR_TWO_WAY;
-    router(ROUTER_C)->flags = 0;
-    const wccp_sending_router *b = router(ROUTER_B);
-    EXPECT_EQ(wccp_get_router_connection_stats(group, &one_way, &two_way), 0);
-    EXPECT_TRUE(one_way == 1 && two_way == 1);
-
-    wccp_sending_router *a = router(ROUTER_A);
-    report(ROUTER_A, {{US, 100}, {host(2), 100}});
-    a->view_appliances[0].buckets_assigned = 5;
-    EXPECT_TRUE(wccp_get_router_assignment(group, a, US, &buckets) == 0 && buckets == 5);
-    EXPECT_TRUE(wccp_get_router_assignment(group, a, host(3), &buckets) == 1 && buckets == 0);
-    EXPECT_EQ(wccp_get_router_assignment(group, a, US, nullptr), 1);
-    EXPECT_EQ(wccp_get_router_connection_stats(nullptr, &one_way, &two_way), 1);
-    EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, b), 0);
-    a->view_appliances[1].buckets_assigned = 5;
-    EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, b), 1);
-    EXPECT_EQ(wccp_any_routers_redirecting_to_other_appliances(group, a), 0);
 }
 
 } // namespace

@@ -1,17 +1,13 @@
 // The engine's threads together: the stop while they wait for the lock or for tunneld, and addresses that
 // change while receivers wait. An alarm ends the program if a thread never returns.
 
-#include <arpa/inet.h>
 #include <net/if.h>
-#include <signal.h>
+#include <netinet/in.h>
 #include <sys/ioctl.h>
 #include <sys/socket.h>
-#include <unistd.h>
 
-#include <atomic>
 #include <chrono>
 #include <optional>
-#include <thread>
 
 #include "engine/wccp_pkt_mgr.h"
 #include "engine/wccp_router_utils.h"
@@ -28,26 +24,23 @@ namespace {
 template <typename Condition>
 bool soon(Condition condition, std::chrono::milliseconds limit = 5s) {
     const auto end = steady::now() + limit;
-    while (!condition()) {
-        if (steady::now() > end)
-            return false;
+    while (!condition() && steady::now() < end)
         std::this_thread::sleep_for(2ms);
-    }
-    return true;
+    return condition();
 }
 
 bool lock_is_free() {
-    if (pthread_mutex_trylock(&wccp_g.lock) != 0)
-        return false;
-    pthread_mutex_unlock(&wccp_g.lock);
-    return true;
+    const bool free = pthread_mutex_trylock(&wccp_g.lock) == 0;
+    if (free)
+        pthread_mutex_unlock(&wccp_g.lock);
+    return free;
 }
 
 enum method { GRE = 1, L2 = 2 }; // GRE needs a tunnel
 
 // The I-See-You of a router that lists this appliance: no security, hash, no assignment yet.
 std::vector<uint8_t> i_see_you(uint8_t id, const std::string &router, const std::string &appliance,
-                               method way = GRE) {
+                               method way) {
     const be32 from = ipa(router), to = ipa(appliance);
     return wire_message(11, {security_info(), service_info(id), router_identity(from, to, 1),
                              router_view({from}, {element_of(to, 0)}), capability_info(way, 1, way)});
@@ -56,8 +49,7 @@ void see_you(int fd, uint8_t id, const std::string &router, const std::string &a
     send_datagram(fd, appliance, 2048, i_see_you(id, router, appliance, way));
 }
 
-class Threads : public testing::Test {
-protected:
+struct Threads : testing::Test {
     void SetUp() override {
         alarm(240);
         fresh_engine();
@@ -97,10 +89,15 @@ protected:
         return group ? group->sending_router_count : 0;
     }
     static const cthread *start_timer_thread() {
-        cthread *timer =
-            cthread_init("WCCP_TIMER", wccp_timer_thread_fn, nullptr, nullptr, nullptr, 0, 0, 0, 0);
+        cthread *timer = cthread_init("WCCP_TIMER", wccp_timer_thread_fn, {}, nullptr, {}, 0, 0, 0, 0);
         EXPECT_EQ(cthread_start(timer), 0);
         return timer;
+    }
+
+    // After a stop or an exit.
+    static void nothing_runs() {
+        EXPECT_EQ(threads_named("WCCP_"), 0);
+        EXPECT_TRUE(lock_is_free());
     }
 
     std::optional<fake_tunneld> tunneld; // once there is a mailbox
@@ -133,8 +130,7 @@ TEST_F(Threads, BridgeModeWhileReceiversWaitForTheLock) {
     tunneld->answer_with(tunneld_does);
     manager.join();
 
-    EXPECT_EQ(threads_named("WCCP_"), 0);
-    EXPECT_TRUE(lock_is_free());
+    nothing_runs();
     EXPECT_EQ(router_count(61) + router_count(62), 0u);
     for (const seen_command &command : tunneld->take_commands())
         EXPECT_NE(command.code, MAILBOX_ADD_TUNNEL);
@@ -157,8 +153,7 @@ TEST_F(Threads, BridgeModeUnderAFlood) {
         wccp_interface *wan = wccp_if_find_interface("wan0");
         ASSERT_TRUE(soon([] { return router_count(61) > 0; }));
         EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0);
-        EXPECT_EQ(router_count(61), 0u);
-        EXPECT_TRUE(lock_is_free());
+        EXPECT_TRUE(router_count(61) == 0 && lock_is_free());
         wccp_del_group(61);
         make_another_receiver(wan);
     }
@@ -190,17 +185,14 @@ TEST_F(Threads, ExitWhileAReceiverWaitsForAnAbsentTunneld) {
             wccp_cleanup_shmem();
         EXPECT_EQ(wccp_exit_mgr(), 0);
         EXPECT_LT(steady::now() - before, reset ? 3s : 6s);
-        EXPECT_EQ(threads_named("WCCP_"), 0);
-        EXPECT_TRUE(lock_is_free());
-        EXPECT_EQ(wccp_g.group_count, 0u);
-        EXPECT_EQ(wan->ucast_fd, -1);
+        nothing_runs();
+        EXPECT_TRUE(wccp_g.group_count == 0 && wan->ucast_fd == -1);
     }
 }
 
 // Notifications and datagrams that wait for the lock while the exit begins have no effect.
 TEST_F(Threads, NotificationsAndADatagramDuringAnExit) {
-    wccp_service_group *group = add_group(61, "wan0");
-    wccp_interface *wan = group->interfaces[0];
+    const wccp_interface *wan = add_group(61, "wan0")->interfaces[0];
     run_command("ip addr add 10.1.0.9/24 dev wan0 && ip addr del 10.1.0.1/24 dev wan0 && "
                 "ip addr flush dev wan1 && ip addr add 10.1.0.1/32 dev lo");
     std::thread address, link;
@@ -225,10 +217,9 @@ TEST_F(Threads, NotificationsAndADatagramDuringAnExit) {
     link.join();
     std::this_thread::sleep_for(50ms);
     EXPECT_EQ(wccp_exit_mgr(), 0);
-    EXPECT_EQ(wccp_g.rx_failures, 0u);
     run_command("ip addr del 10.1.0.1/32 dev lo");
-    EXPECT_TRUE(wan->ipa_change_count == 0 && wan->link_down_count == 0);
-    EXPECT_EQ(threads_named("WCCP_"), 0);
+    EXPECT_TRUE(wccp_g.rx_failures == 0 && wan->ipa_change_count == 0 && wan->link_down_count == 0);
+    nothing_runs();
     EXPECT_EQ(wan->ucast_fd, -1);
 }
 
@@ -239,40 +230,35 @@ TEST_F(Threads, APacketBetweenStopAndStartChangesNothing) {
     const auto process = [] {
         const wccp_engine_lock lock;
         return wccp_process_received_packet(
-            make_received(i_see_you(61, "10.1.0.2", "10.1.0.1"), ipa("10.1.0.2")).get());
+            make_received(i_see_you(61, "10.1.0.2", "10.1.0.1", GRE), ipa("10.1.0.2")).get());
     };
     const auto joins = [&] {
         EXPECT_EQ(process(), 0);
-        EXPECT_EQ(group->sending_router_count, 1u);
-        EXPECT_EQ(group->fwd_method, WCCP_METHOD_GRE + 0u);
+        EXPECT_TRUE(group->sending_router_count == 1 && group->fwd_method == WCCP_METHOD_GRE);
         EXPECT_TRUE(group->state_flags & WCCP_CAPABILITIES_SET);
         const std::vector<seen_command> seen = tunneld->take_commands();
         return seen.size() == 1 && seen[0].code == MAILBOX_ADD_TUNNEL && seen[0].local == 0x0a010001;
     };
-    const struct {
-        const char *gone;
-        std::function<void(bool)> link_or_address;
-    } ways[] = {{"link",
-                 [](bool up) {
-                     const qv_if_state_info info = {"wan0", up, up};
-                     wccp_process_if_state_change(&info);
-                 }},
-                {"address", [](bool up) {
-                     run_command(std::string("ip addr ") + (up ? "add" : "del") + " 10.1.0.1/24 dev wan0");
-                     wccp_process_if_ipa_update("wan0");
-                 }}};
+    const std::pair<const char *, std::function<void(bool)>> ways[] = {
+        {"link",
+         [](bool up) {
+             const qv_if_state_info info = {"wan0", up, up};
+             wccp_process_if_state_change(&info);
+         }},
+        {"address", [](bool up) {
+             run_command(std::string("ip addr ") + (up ? "add" : "del") + " 10.1.0.1/24 dev wan0");
+             wccp_process_if_ipa_update("wan0");
+         }}};
     (void)tunneld->take_commands(); // the L2 return of the start
-    for (const auto &way : ways) {
-        SCOPED_TRACE(way.gone);
+    for (const auto &[gone, link_or_address] : ways) {
+        SCOPED_TRACE(gone);
         EXPECT_TRUE(joins());
-        way.link_or_address(false);
+        link_or_address(false);
         (void)tunneld->take_commands(); // the delete
         const uint32_t icus = group->rx_icus;
         EXPECT_EQ(process(), 0);
-        EXPECT_EQ(group->rx_icus, icus);
-        EXPECT_EQ(group->sending_router_count, 0u);
-        EXPECT_EQ(group->state_flags, WCCP_STATE_INIT);
-        EXPECT_TRUE(tunneld->take_commands().empty());
+        EXPECT_TRUE(group->rx_icus == icus && group->sending_router_count == 0 &&
+                    group->state_flags == WCCP_STATE_INIT && tunneld->take_commands().empty());
 
         // If a router is known nevertheless, the next start removes it, and its tunnel from the old address.
         const wccp_rtr_capabilities gre = {WCCP_METHOD_GRE, WCCP_ASSIGN_HASH, WCCP_METHOD_GRE};
@@ -280,12 +266,11 @@ TEST_F(Threads, APacketBetweenStopAndStartChangesNothing) {
         ASSERT_NE(wccp_create_sending_router(group, ipa("10.1.0.2"), &gre, &gre), nullptr);
         group->assign_timer.active = 1;
         (void)tunneld->take_commands();
-        way.link_or_address(true);
+        link_or_address(true);
         EXPECT_EQ(group->sending_router_count + group->assign_timer.active, 0u);
         const std::vector<seen_command> seen = tunneld->take_commands();
         ASSERT_EQ(seen.size(), 2u); // and the L2 return
-        EXPECT_EQ(seen[0].code, MAILBOX_DELETE_TUNNEL);
-        EXPECT_EQ(seen[0].local, to_host(old_address));
+        EXPECT_TRUE(seen[0].code == MAILBOX_DELETE_TUNNEL && seen[0].local == to_host(old_address));
     }
     EXPECT_TRUE(joins());
 }
@@ -294,9 +279,7 @@ TEST_F(Threads, APacketBetweenStopAndStartChangesNothing) {
 void set_address(const char *name, const char *address) {
     ifreq request = {};
     strlcpy(request.ifr_name, name, sizeof request.ifr_name);
-    sockaddr_in in = {};
-    in.sin_family = AF_INET;
-    in.sin_addr.s_addr = address_word(address);
+    const sockaddr_in in = {AF_INET, 0, {address_word(address)}, {}};
     memcpy(&request.ifr_addr, &in, sizeof in);
     EXPECT_EQ(ioctl(g_qvif_skfd, SIOCSIFADDR, &request), 0);
 }
@@ -307,10 +290,10 @@ TEST_F(Threads, AddressesChangeAThousandTimesWhileReceiversWait) {
     std::atomic<bool> over = false;
     std::thread flood([&] {
         while (!over) {
-            see_you(first, 61, "10.1.0.2", "10.1.0.1");
-            see_you(first, 61, "10.1.0.2", "10.1.0.9");
-            see_you(second, 62, "10.2.0.2", "10.2.0.1");
-            see_you(second, 62, "10.2.0.2", "10.2.0.9");
+            for (const std::string end : {".1", ".9"}) {
+                see_you(first, 61, "10.1.0.2", "10.1.0" + end);
+                see_you(second, 62, "10.2.0.2", "10.2.0" + end);
+            }
         }
     });
     const auto change = [&](const char *name, const char *one, const char *other) {
@@ -325,8 +308,8 @@ TEST_F(Threads, AddressesChangeAThousandTimesWhileReceiversWait) {
     over = true;
     flood.join();
 
-    EXPECT_EQ(wccp_if_find_interface("wan0")->ipa_change_count, 1000u);
-    EXPECT_EQ(wccp_if_find_interface("wan1")->ipa_change_count, 1000u);
+    for (const char *name : {"wan0", "wan1"})
+        EXPECT_EQ(wccp_if_find_interface(name)->ipa_change_count, 1000u);
     // Both receivers are alive and read what is sent to the present address.
     EXPECT_EQ(threads_named("WCCP_"), 2);
     const auto icus_of = [](uint8_t id) {

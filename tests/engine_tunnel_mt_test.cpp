@@ -2,8 +2,6 @@
 
 #include "engine/wccp_tunnel.h"
 
-#include <set>
-
 #include "engine/wccp_host.h"
 #include "engine/wccp_router_utils.h"
 #include "engine/wccpd_common.h"
@@ -62,16 +60,13 @@ TEST_F(Tunnels, GroupsThatShareARouterShareTheTunnel) {
     EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
     EXPECT_TRUE(log.say("WCCP GRP 51: created GRE tunnel id 1000 10.0.0.1 <=> 10.0.1.1"));
     EXPECT_EQ(wccp_add_tunnel(52, self, router(1)), 0);
-    EXPECT_EQ(commands(), (std::vector<seen_command>{
-                              {MAILBOX_ADD_TUNNEL, 1000, 0x0A000001, 0x0A000101, WCCP_NO_INDEX, 0, 0}}))
-        << "once, and in host order";
+    using seen = std::vector<seen_command>;
+    EXPECT_EQ(commands(), (seen{{MAILBOX_ADD_TUNNEL, 1000, 0x0A000001, 0x0A000101, WCCP_NO_INDEX, 0, 0}}));
     EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
     EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "no such tunnel";
     EXPECT_EQ(commands().size(), 0u);
     EXPECT_EQ(wccp_del_tunnel(52, self, router(1), 0), 0);
-    EXPECT_EQ(commands(),
-              (std::vector<seen_command>{{MAILBOX_DELETE_TUNNEL, 1000, 0x0A000001, 0x0A000101, 2000, 0, 0}}))
-        << "with the index of its add";
+    EXPECT_EQ(commands(), (seen{{MAILBOX_DELETE_TUNNEL, 1000, 0x0A000001, 0x0A000101, 2000, 0, 0}}));
     EXPECT_TRUE(log.say("WCCP GRP 52: deleted GRE tunnel id: 1000 10.0.0.1 <=> 10.0.1.1"));
 
     wccp_add_tunnel(51, self, router(1));
@@ -92,8 +87,7 @@ TEST_F(Tunnels, ThereAreThirtyTwoIdsAndAFreedOneIsUsedNext) {
     EXPECT_EQ(wccp_add_tunnel(1, self, router(32)), 1);
     EXPECT_TRUE(log.say("WCCP GRP 1: No free tunnel id available"));
     EXPECT_EQ(take_reasons(&group), "tunnel-ids-exhausted 10.0.1.32: |ids 1000 to 1031");
-    EXPECT_EQ(wccp_add_tunnel(1, self, router(4)), 0) << "a known one needs no id";
-    EXPECT_EQ(commands().size(), 0u);
+    EXPECT_TRUE(wccp_add_tunnel(1, self, router(4)) == 0 && commands().empty()) << "a known one needs no id";
     for (const uint32_t i : {31u, 7u}) {
         EXPECT_EQ(wccp_del_tunnel(1, self, router(i), 0), 0);
         EXPECT_EQ(wccp_add_tunnel(1, self, router(32 + i)), 0);
@@ -110,8 +104,7 @@ TEST_F(Tunnels, ARefusedAddLeavesNothing) {
         EXPECT_TRUE(log.say("WCCP GRP 51: failed to add tunnel: id: 1000 10.0.0.1 <=> 10.0.1.1"));
         EXPECT_EQ(take_reasons(&group), "tunnel-refused 10.0.1.1: tunnel id 1000|from 10.0.0.1");
         EXPECT_EQ(commands().size(), 1u);
-        EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
-        EXPECT_EQ(commands().size(), 0u) << "it is not in the table";
+        EXPECT_TRUE(wccp_del_tunnel(51, self, router(1), 0) == 0 && commands().empty()) << "not in the table";
     }
     tunneld.answer_with(tunneld_does);
     EXPECT_EQ(wccp_add_tunnel(51, self, router(2)), 0);
@@ -152,27 +145,26 @@ TEST_F(Tunnels, RestoreSendsEveryTunnelAgainAndKeepsThemAll) {
 TEST_F(Tunnels, RoutersGetATunnelEachAndGiveItBack) {
     const reported_group shared(false, 60);
     wccp_service_group *known = shared.group;
-    const auto codes = [this] {
-        std::vector<uint16_t> found;
-        for (const seen_command &command : commands())
-            found.push_back(command.code);
-        return found;
+    const auto count = [this](uint16_t code) {
+        const std::vector<seen_command> found = commands();
+        return std::all_of(found.begin(), found.end(), [=](auto &each) { return each.code == code; })
+                   ? found.size()
+                   : 99;
     };
     const wccp_rtr_capabilities gre = {1, 1, 1}, gre_return = {2, 1, 1};
     ASSERT_NE(wccp_create_sending_router(known, ROUTER_A, &gre, &gre), nullptr);
     wccp_sending_router *b = wccp_create_sending_router(known, ROUTER_B, &gre_return, &gre_return);
     ASSERT_NE(b, nullptr);
     EXPECT_EQ(b->flags, WCCP_RTR_ONE_WAY | WCCP_RTR_HAS_TUNNEL);
-    EXPECT_EQ(codes(), (std::vector<uint16_t>{MAILBOX_ADD_TUNNEL, MAILBOX_ADD_TUNNEL}));
+    EXPECT_EQ(count(MAILBOX_ADD_TUNNEL), 2u);
     tunneld.answer_with([](const seen_command &) { return tunneld_answer{1, 5}; });
     EXPECT_EQ(wccp_create_sending_router(known, ROUTER_C, &gre, &gre), nullptr);
     EXPECT_EQ(known->sending_router_count, 2u);
     tunneld.answer_with(tunneld_does);
-    codes();
+    commands();
     wccp_g.seconds += 40;
     wccp_monitor_sending_routers(known);
-    EXPECT_EQ(known->sending_router_count, 0u);
-    EXPECT_EQ(codes(), (std::vector<uint16_t>{MAILBOX_DELETE_TUNNEL, MAILBOX_DELETE_TUNNEL}));
+    EXPECT_TRUE(known->sending_router_count == 0 && count(MAILBOX_DELETE_TUNNEL) == 2);
 }
 
 // Several threads add and delete tunnels while all are deleted, as at exit: commands do not overlap, and each

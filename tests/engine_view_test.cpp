@@ -2,11 +2,8 @@
 // routers assign.
 #include "engine/wccp_view_utils.h"
 
-#include <sstream>
-
 #include "engine/wccp_pkt_unload.h"
 #include "engine/wccp_state.h"
-#include "runtime/list.h"
 #include "tests/support/reported_group.h"
 
 namespace {
@@ -25,8 +22,7 @@ struct ViewTest : testing::Test, all_freed, reported_group {
         for (const wccp_view_appliance *entry = group->appliance_view; entry;
              entry = entry->next, appliances++)
             text << " " << name(entry->ipa) << "/" << entry->weight << ":" << entry->ref_count;
-        EXPECT_EQ(group->router_view_count, routers);
-        EXPECT_EQ(group->appliance_view_count, appliances);
+        EXPECT_TRUE(group->router_view_count == routers && group->appliance_view_count == appliances);
         const uint32_t risen = group->change_number - seen_change_number;
         EXPECT_EQ((group->state_flags & WCCP_DESG_ELECT_PENDING) != 0, risen != 0);
         group->state_flags &= ~WCCP_DESG_ELECT_PENDING;
@@ -40,12 +36,7 @@ struct ViewTest : testing::Test, all_freed, reported_group {
 TEST_F(ViewTest, ReportsUpdateTheUnion) {
     const be32 A = ROUTER_A, B = ROUTER_B;
     const be32 low = to_be32(0x0a000002), high = to_be32(0x0a000101);
-    const struct {
-        be32 from;
-        std::vector<be32> routers;
-        reported_appliances appliances;
-        const char *views;
-    } steps[] = {
+    const std::tuple<be32, std::vector<be32>, reported_appliances, const char *> steps[] = {
         // Only the head is compared in a sorted insertion.
         {A,
          {},
@@ -79,9 +70,9 @@ TEST_F(ViewTest, ReportsUpdateTheUnion) {
         {B, {}, {{low, 5}, {US, 8}}, "| 0.1/8:2 0.2/5:2 +0"},
         {A, {}, {{low, 9}, {US, 8}}, "| 0.1/8:2 0.2/5:2 +0"},
     };
-    for (const auto &step : steps) {
-        see(step.from, step.routers, step.appliances);
-        EXPECT_EQ(views(), step.views) << "step " << &step - steps;
+    for (const auto &[from, routers, appliances, wanted] : steps) {
+        see(from, routers, appliances);
+        EXPECT_EQ(views(), wanted);
         EXPECT_EQ((router(A)->flags & WCCP_RTR_TWO_WAY) != 0,
                   wccp_get_router_appliance_view_element(router(A), US) != nullptr);
     }
@@ -121,22 +112,15 @@ TEST_F(ViewTest, ARouterIsTwoWayWhileItListsThisAppliance) {
     group->ucast_router_count = 1;
     wccp_g.seconds = 100;
     const wccp_sending_router *a = router(ROUTER_A);
-    const struct {
-        reported_appliances list;
-        uint32_t flags, state_time;
-        uint16_t alarms;
-    } steps[] = {
+    const std::tuple<reported_appliances, uint32_t, uint32_t, uint16_t> steps[] = {
         {{}, WCCP_RTR_ONE_WAY, 100, 0},
         {{{host(2), 1}}, WCCP_RTR_ONE_WAY, 100, 0},
         {{{host(2), 1}, {US, 1}}, WCCP_RTR_TWO_WAY, 120, 0},
         {{{host(2), 1}, {US, 1}}, WCCP_RTR_TWO_WAY, 120, 0},
-        {{{host(2), 1}}, WCCP_RTR_ONE_WAY, 140, WCCP_ALARM_ADJACENCY},
-    };
-    for (const auto &step : steps) {
-        report(ROUTER_A, step.list);
-        EXPECT_EQ(a->flags, step.flags);
-        EXPECT_EQ(a->state_time, step.state_time);
-        EXPECT_EQ(group->raised_alarms, step.alarms);
+        {{{host(2), 1}}, WCCP_RTR_ONE_WAY, 140, WCCP_ALARM_ADJACENCY}};
+    for (const auto &[list, flags, time, alarms] : steps) {
+        report(ROUTER_A, list);
+        EXPECT_EQ(std::tuple(a->flags, a->state_time, group->raised_alarms), std::tuple(flags, time, alarms));
         wccp_g.seconds += 10;
     }
     wccp_g.seconds = 0;
@@ -149,10 +133,9 @@ TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     router(ROUTER_A)->assign_tx_count = 3;
     EXPECT_EQ(report(ROUTER_A, {{US, 100}, {host(2), 300}}), 0);
     EXPECT_EQ(views(), "| 0.2/300:1 0.1/100:1 +0");
-    EXPECT_EQ(group->dsg_key_change, 1u);
-    EXPECT_EQ(group->assign_timer.countdown, 1u);
-    EXPECT_EQ(group->pending_acks, 1);
-    EXPECT_EQ(router(ROUTER_A)->assign_tx_count, 0u);
+    EXPECT_EQ(std::tuple(group->dsg_key_change, group->assign_timer.countdown, group->pending_acks,
+                         router(ROUTER_A)->assign_tx_count),
+              std::tuple(1, 1, 1, 0));
     // When no appliance is left that all routers report, the update fails, but the whole report is applied,
     // so that the next one can remove it again.
     const be32 lowest = to_be32(0x0a000000);
@@ -161,20 +144,20 @@ TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     EXPECT_EQ(views(), "| 0.4/1:1 0.1/150:1 0.0/1:1 0.3/100:1 +2");
     EXPECT_EQ(router(ROUTER_A)->view_appliance_count, 3u);
     EXPECT_EQ(group->assign_timer.active + group->pending_acks, 0);
-    report(ROUTER_A, {{US, 150}, {host(3), 100}});
-    report(ROUTER_B, {{US, 150}, {host(3), 100}});
+    for (const be32 id : {ROUTER_A, ROUTER_B})
+        report(id, {{US, 150}, {host(3), 100}});
     EXPECT_EQ(views(), "| 0.1/150:2 0.3/100:2 +2");
 }
 
 TEST_F(ViewTest, WithoutBucketsTheEarlierBitsStay) {
     wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES] = {};
-    decoded[0] = {US, 100, 0, 1, 256, {0, 0, 0, 8}};
     wccp_sending_router *a = router(ROUTER_A);
-    wccp_update_appliance_view(group, a, 1, decoded);
-    decoded[0] = {US, 100, 0, 0, 0, {}};
-    wccp_update_appliance_view(group, a, 1, decoded);
-    EXPECT_EQ(a->view_appliances[0].buckets_assigned, 0);
-    EXPECT_EQ(a->view_appliances[0].bucket_bits[3], 8u);
+    for (const auto &each :
+         {wccp_rtr_view_appliance{US, 100, 0, 1, 256, {0, 0, 0, 8}}, {US, 100, 0, 0, 0, {}}}) {
+        decoded[0] = each;
+        wccp_update_appliance_view(group, a, 1, decoded);
+    }
+    EXPECT_TRUE(a->view_appliances[0].buckets_assigned == 0 && a->view_appliances[0].bucket_bits[3] == 8);
 }
 
 // What a router assigns to this appliance and to all; then the number of routers that redirect here, the
@@ -182,13 +165,7 @@ TEST_F(ViewTest, WithoutBucketsTheEarlierBitsStay) {
 TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
     const be32 A = ROUTER_A, B = ROUTER_B, C = ROUTER_C;
     constexpr uint32_t INIT = WCCP_STATE_INIT, ACTIVE = WCCP_STATE_ACTIVE, BACKUP = WCCP_STATE_BACKUP;
-    const struct {
-        be32 from;
-        uint16_t self, total;
-        uint8_t redirecting;
-        uint32_t state, transitions;
-        std::string line;
-    } steps[] = {
+    const std::tuple<be32, uint16_t, uint16_t, uint8_t, uint32_t, uint32_t, std::string> steps[] = {
         {A, 128, 256, 1, ACTIVE, 1, "first router to self (router id 10.0.0.201 )"},
         {A, 100, 256, 1, ACTIVE, 1, ""},
         {B, 128, 256, 2, ACTIVE, 1, ""},
@@ -210,8 +187,7 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
         {A, 0, 0, 0, BACKUP, 6, ""},
         {C, 0, 64, 0, BACKUP, 6, ""},
         {B, 0, 0, 0, BACKUP, 6, ""},
-        {C, 0, 0, 0, INIT, 6, "no routers redirecting to group (router id 10.0.0.203)"},
-    };
+        {C, 0, 0, 0, INIT, 6, "no routers redirecting to group (router id 10.0.0.203)"}};
     for (const be32 id : {A, B, C})
         report(id, {{US, 100}, {host(2), 100}});
     log_lines log;
@@ -222,18 +198,16 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
         from->view_appliances[1].buckets_assigned = static_cast<uint16_t>(total - self);
         const wccp_assign_summary hash = {1, self, total}, mask = {};
         EXPECT_EQ(wccp_update_appliance_redirect_status(group, from, &hash, &mask), 0);
-        EXPECT_EQ(from->self_buckets, self);
-        EXPECT_EQ(from->total_buckets, total);
+        EXPECT_TRUE(from->self_buckets == self && from->total_buckets == total);
     };
-    for (const auto &step : steps) {
-        SCOPED_TRACE(&step - steps);
-        assign(step.from, step.self, step.total);
-        EXPECT_EQ(group->redirecting_routers, step.redirecting);
-        EXPECT_EQ(group->state_flags & WCCP_STATE_MASK, step.state);
-        EXPECT_EQ(group->transitions, step.transitions);
+    for (const auto &[from, self, total, redirecting, state, transitions, line] : steps) {
+        assign(from, self, total);
+        EXPECT_EQ(
+            std::tuple(group->redirecting_routers, group->state_flags & WCCP_STATE_MASK, group->transitions),
+            std::tuple(redirecting, state, transitions));
         const std::string said = log.take(), begin = "WCCP GRP 51: redirect: ";
-        EXPECT_EQ(said.find(begin) == std::string::npos, step.line.empty()) << said;
-        EXPECT_TRUE(step.line.empty() || said.find(begin + step.line) != std::string::npos) << said;
+        EXPECT_EQ(count_of(begin, said) != 0, !line.empty()) << said;
+        EXPECT_TRUE(line.empty() || count_of(begin + line, said) == 1) << said;
     }
     // A count of 0, as after a start of the group, does not wrap.
     for (const uint16_t total : {uint16_t{256}, uint16_t{0}}) {
@@ -246,9 +220,8 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
     const uint32_t checks = group->alarm_assign_sched;
     for (int round = 0; round < 2; round++) {
         EXPECT_EQ(wccp_update_appliance_redirect_status(group, router(A), &hash, &mask), 0);
-        EXPECT_EQ(router(A)->self_buckets, 8);
-        EXPECT_EQ(router(A)->total_buckets, 16);
-        EXPECT_EQ(group->alarm_assign_sched, checks + 1);
+        EXPECT_EQ(std::tuple(router(A)->self_buckets, router(A)->total_buckets, group->alarm_assign_sched),
+                  std::tuple(8, 16, checks + 1));
     }
     EXPECT_EQ(group->redirecting_routers, 1);
     // Neither: the elements say that a map should have come.
@@ -256,8 +229,7 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
     log.take();
     EXPECT_EQ(wccp_update_appliance_redirect_status(group, router(A), &none, &none), 1);
     EXPECT_EQ(router(A)->self_buckets, 8);
-    EXPECT_TRUE(log.say("WCCP GRP 51: update redirect status: assign. info not found. sender rtr id: "
-                        "10.0.0.201"));
+    EXPECT_TRUE(log.say("update redirect status: assign. info not found. sender rtr id: 10.0.0.201"));
 }
 
 } // namespace

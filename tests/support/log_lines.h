@@ -4,6 +4,14 @@
 #include "runtime/logging.h"
 #include "tests/support/log_daemon.h"
 
+// How often a text contains another.
+inline int count_of(const std::string &part, const std::string &in) {
+    int count = 0;
+    for (size_t at = 0; (at = in.find(part, at)) != std::string::npos; at++)
+        count++;
+    return count;
+}
+
 struct log_lines {
     log_daemon daemon;
 
