@@ -1,10 +1,7 @@
 // The event loop and other threads: escapes and posted work end a wait, nested or not.
-#include <atomic>
-#include <functional>
 #include <thread>
 
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include "daemon/libevent_wrapper.h"
 #include "runtime/ttime.h"
@@ -22,8 +19,8 @@ struct loop_thread {
 
     static void run_first(int, short, void *data) {
         auto *self = static_cast<loop_thread *>(data);
-        EXPECT_EQ(loop_event_set_timer(self->starter, 60000),
-                  LC_OK); // so that the loop has something to wait for
+        // So that the loop has something to wait for.
+        EXPECT_EQ(loop_event_set_timer(self->starter, 60000), LC_OK);
         if (self->first)
             self->first();
     }
@@ -64,8 +61,7 @@ TEST(LoopThreads, AnEscapeFromOutsideEndsTheWaitAtEachDepth) {
         EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
         it.finish();
         EXPECT_LT(lt_monotonic_ms() - start, 2000);
-        EXPECT_EQ(it.escaped, 1);
-        EXPECT_EQ(inner, nested ? 1 : -1);
+        EXPECT_TRUE(it.escaped == 1 && inner == (nested ? 1 : -1));
     }
 }
 
@@ -81,16 +77,13 @@ struct counted_post {
     static void function(loop_post *post, int carry_out) {
         auto *self = reinterpret_cast<counted_post *>(post);
         if (carry_out) {
-            EXPECT_TRUE(loop_is_own_thread(self->loop));
-            EXPECT_EQ(self->number, (*self->expected)++);
+            EXPECT_TRUE(loop_is_own_thread(self->loop) && self->number == (*self->expected)++);
         }
         (carry_out ? self->all->carried : self->all->withdrawn)++;
         delete self;
     }
     static void send(counts *all, loop_context *loop, int number, int *expected) {
-        auto *record = new counted_post{{}, all, loop, number, expected};
-        record->post.function = function;
-        record->post.poster = expected;
+        auto *record = new counted_post{{nullptr, expected, function}, all, loop, number, expected};
         loop_post_work(loop, &record->post);
     }
 };
@@ -112,8 +105,7 @@ TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
     for (const int64_t start = lt_monotonic_ms();
          all.carried < posters * each && lt_monotonic_ms() - start < 4000;)
         usleep(1000);
-    EXPECT_EQ(all.carried, posters * each);
-    EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
+    EXPECT_TRUE(all.carried == posters * each && lew_escape_from_dispatch(it.wrapper) == LC_OK);
     it.thread.join();
     // Later posts are handed back when they are withdrawn or the loop is freed.
     for (int &poster : unused)

@@ -2,14 +2,9 @@
 #include "daemon/libevent_wrapper.h"
 
 #include <csignal>
-#include <functional>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include <gtest/gtest.h>
-#include <pthread.h>
-#include <unistd.h>
 
 #include "runtime/ttime.h"
 
@@ -22,10 +17,7 @@ struct Loop : testing::Test {
         ASSERT_EQ(lew_init(&wrapper), LC_OK);
         ASSERT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
     }
-    void TearDown() override {
-        EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
-        EXPECT_EQ(wrapper, nullptr);
-    }
+    void TearDown() override { EXPECT_TRUE(lew_deinit(&wrapper) == LC_OK && !wrapper); }
     // The result: "no events", "escaped", "ran" or a status.
     std::string dispatched(lc_status (*dispatch)(lew *, int *, int *)) const {
         int none = 5, escaped = 5;
@@ -42,7 +34,10 @@ struct watched {
     loop_event *event = nullptr;
     int runs = 0;
     std::function<void()> action;
-    void start(loop_context *loop) { ASSERT_EQ(loop_event_new(loop, fired, this, &event), LC_OK); }
+    void make(loop_context *loop, std::function<void()> then) {
+        action = std::move(then);
+        ASSERT_EQ(loop_event_new(loop, fired, this, &event), LC_OK);
+    }
     static void fired(int fd, short flags, void *data) {
         auto *self = static_cast<watched *>(data);
         char byte;
@@ -59,10 +54,9 @@ struct watched {
 // On a pipe that holds a byte until the event has run.
 struct readable : watched {
     int ends[2] = {-1, -1};
-    void start(loop_context *loop) {
-        watched::start(loop);
-        ASSERT_EQ(pipe(ends), 0);
-        ASSERT_EQ(loop_event_set_fd(event, ends[0], LOOP_READ), LC_OK);
+    void start(loop_context *loop, std::function<void()> then = nullptr) {
+        make(loop, std::move(then));
+        ASSERT_TRUE(pipe(ends) == 0 && loop_event_set_fd(event, ends[0], LOOP_READ) == LC_OK);
         fill();
     }
     void fill() const { ASSERT_EQ(write(ends[1], "x", 1), 1); }
@@ -73,8 +67,8 @@ struct readable : watched {
     }
 };
 struct timer : watched {
-    void start(loop_context *loop, int64_t delay) {
-        watched::start(loop);
+    void start(loop_context *loop, int64_t delay, std::function<void()> then = nullptr) {
+        make(loop, std::move(then));
         ASSERT_EQ(loop_event_set_timer(event, delay), LC_OK);
     }
 };
@@ -86,47 +80,37 @@ TEST_F(Loop, EndsWhenNothingIsRegistered) {
     only.start(loop, 30);
     const int64_t start = lt_monotonic_ms();
     EXPECT_EQ(whole(), "no events");
-    EXPECT_EQ(only.runs, 1);
-    EXPECT_GE(lt_monotonic_ms() - start, 25);
+    EXPECT_TRUE(only.runs == 1 && lt_monotonic_ms() - start >= 25);
     readable gone; // closed: reported as ready, and removes itself
-    gone.start(loop);
+    gone.start(loop, [&] { loop_event_free(&gone.event); });
     close(gone.ends[0]);
-    gone.action = [&] { loop_event_free(&gone.event); };
     EXPECT_EQ(whole(), "no events");
     EXPECT_EQ(gone.runs, 1);
     int none = 5;
-    EXPECT_EQ(lew_dispatch(nullptr, &none, nullptr), LC_NULL);
-    EXPECT_EQ(none, 0);
+    EXPECT_TRUE(lew_dispatch(nullptr, &none, nullptr) == LC_NULL && none == 0);
     std::thread([&] { EXPECT_EQ(whole() + once(), "1400214002"); }).join(); // only the owner may dispatch
 }
 
 TEST_F(Loop, AnEscapeIsStickyAndEndsEachDepthAtOnce) {
     readable first, second;
     timer inner;
-    second.action = [&] {
-        inner.start(loop, 1);
-        inner.action = [&] { escape(); };
-        EXPECT_EQ(once(), "escaped");
-        EXPECT_EQ(once(), "escaped");
-    };
-    first.action = [&] {
-        second.start(loop);
+    first.start(loop, [&] {
+        second.start(loop, [&] {
+            inner.start(loop, 1, [&] { escape(); });
+            EXPECT_EQ(once() + once(), "escapedescaped");
+        });
         EXPECT_EQ(once(), "escaped"); // when the inner wait has ended
-    };
-    first.start(loop);
+    });
     EXPECT_EQ(whole(), "escaped");
-    EXPECT_EQ(first.runs + second.runs, 2);
     first.fill();
-    EXPECT_EQ(whole(), "escaped");
-    EXPECT_EQ(once(), "escaped");
+    EXPECT_EQ(whole() + once(), "escapedescaped");
     EXPECT_EQ(first.runs + second.runs, 2);
 }
 
 TEST_F(Loop, AnEscapeInACallbackEndsTheRoundBeforeTheNextOne) {
     readable first, second;
-    first.start(loop);
-    second.start(loop);
-    first.action = second.action = [&] { escape(); };
+    for (readable *each : {&first, &second})
+        each->start(loop, [&] { escape(); });
     EXPECT_EQ(whole(), "escaped");
     EXPECT_EQ(first.runs + second.runs, 1);
 }
@@ -138,19 +122,16 @@ TEST_F(Loop, WaitsNestToAnyDepth) {
     int inside = 0, deepest = 0;
     timer later; // not waited for
     later.start(loop, 5000);
-    for (readable &each : events) {
-        each.action = [&] {
+    for (readable &each : events)
+        each.start(loop, [&] {
             deepest = std::max(deepest, ++inside);
             if (deepest < depth) {
                 EXPECT_EQ(once(), "ran");
             }
             inside--;
-        };
-        each.start(loop);
-    }
+        });
     EXPECT_EQ(once(), "ran");
-    EXPECT_EQ(deepest, depth);
-    EXPECT_EQ(later.runs, 0);
+    EXPECT_TRUE(deepest == depth && later.runs == 0);
     for (readable &each : events)
         EXPECT_EQ(each.runs, 1);
 }
@@ -160,13 +141,11 @@ TEST_F(Loop, ANestedWaitHandlesWhatBecomesReadyMeanwhile) {
     timer due;
     later.start(loop);
     EXPECT_EQ(once(), "ran");
-    outer.action = [&] {
-        due.start(loop, 20);
-        due.action = [&] { later.fill(); };
+    outer.start(loop, [&] {
+        due.start(loop, 20, [&] { later.fill(); });
         while (later.runs < 2)
             ASSERT_EQ(once(), "ran");
-    };
-    outer.start(loop);
+    });
     EXPECT_EQ(once(), "ran");
     EXPECT_EQ(outer.runs, 1);
 }
@@ -182,14 +161,11 @@ TEST_F(Loop, AnEventRemovedByAnEarlierCallbackNeverRuns) {
             if (way == 0)
                 return;
             timer nested; // freed by a callback of a nested round
-            nested.start(loop, 0);
-            nested.action = [&, other] { loop_event_free(&pair[other].event); };
+            nested.start(loop, 0, [&, other] { loop_event_free(&pair[other].event); });
             EXPECT_EQ(once(), "ran");
         };
-        pair[0].action = [&] { remove_other(1); };
-        pair[1].action = [&] { remove_other(0); };
-        pair[0].start(loop);
-        pair[1].start(loop);
+        pair[0].start(loop, [&] { remove_other(1); });
+        pair[1].start(loop, [&] { remove_other(0); });
         EXPECT_EQ(once(), "ran");
         EXPECT_EQ(pair[0].runs + pair[1].runs, 1) << way;
     }
@@ -204,15 +180,13 @@ TEST_F(Loop, PostedWorkComesBeforeTheNextCallback) {
         reinterpret_cast<record *>(post)->carried += carry_out;
     };
     readable pair[2];
-    for (readable &each : pair) {
-        each.action = [&] {
+    for (readable &each : pair)
+        each.start(loop, [&] {
             if (pair[0].runs + pair[1].runs == 1)
                 std::thread([&] { loop_post_work(loop, &work.post); }).join();
             else
                 EXPECT_EQ(work.carried, 1);
-        };
-        each.start(loop);
-    }
+        });
     while (pair[0].runs + pair[1].runs < 2)
         ASSERT_EQ(once(), "ran");
 }
@@ -239,8 +213,7 @@ struct Signals : Loop {
 
 TEST_F(Signals, AreCallbacksInTheLoop) {
     result = LC_GENERIC; // logged, and the loop goes on
-    ASSERT_EQ(reg(wrapper, &slots[0], SIGUSR1), LC_OK);
-    ASSERT_EQ(reg(wrapper, &slots[1], SIGUSR2), LC_OK);
+    ASSERT_TRUE(reg(wrapper, &slots[0], SIGUSR1) == LC_OK && reg(wrapper, &slots[1], SIGUSR2) == LC_OK);
     raise(SIGUSR1);
     EXPECT_TRUE(numbers.empty()); // blocked outside the wait
     EXPECT_EQ(once(), "ran");
@@ -248,14 +221,10 @@ TEST_F(Signals, AreCallbacksInTheLoop) {
     raise(SIGUSR1);
     while (numbers.size() < 3)
         ASSERT_EQ(once(), "ran");
-    EXPECT_EQ(numbers[0], SIGUSR1);
-    EXPECT_EQ(numbers[1] + numbers[2], SIGUSR1 + SIGUSR2);
-    for (int i = 0; i < 2; i++) {
-        EXPECT_EQ(lew_event_delete(wrapper, &slots[0]), LC_OK);
-        EXPECT_EQ(slots[0], nullptr);
-    }
-    EXPECT_EQ(le_signal_contexts[SIGUSR1], nullptr);
-    EXPECT_EQ(le_signal_contexts[SIGUSR2], loop);
+    EXPECT_TRUE(numbers[0] == SIGUSR1 && numbers[1] + numbers[2] == SIGUSR1 + SIGUSR2);
+    for (int i = 0; i < 2; i++)
+        EXPECT_TRUE(lew_event_delete(wrapper, &slots[0]) == LC_OK && !slots[0]);
+    EXPECT_TRUE(!le_signal_contexts[SIGUSR1] && le_signal_contexts[SIGUSR2] == loop);
     // A signal ends a wait.
     const pthread_t self = pthread_self();
     std::thread sender([&] {
@@ -266,21 +235,19 @@ TEST_F(Signals, AreCallbacksInTheLoop) {
     EXPECT_EQ(once(), "ran");
     EXPECT_LT(lt_monotonic_ms() - start, 2000);
     sender.join();
-    EXPECT_EQ(lew_delete_all_events(wrapper), LC_OK);
-    EXPECT_EQ(slots[1], nullptr);
+    EXPECT_TRUE(lew_delete_all_events(wrapper) == LC_OK && !slots[1]);
     EXPECT_EQ(whole(), "no events");
 }
 
 // The exit deletes all registrations in the callback of one of them. A second SIGTERM must stay blocked,
 // since it would end the process.
 TEST_F(Signals, AllCanBeDeletedInTheCallbackOfOne) {
-    ASSERT_EQ(reg(wrapper, &slots[0], SIGTERM), LC_OK);
-    ASSERT_EQ(reg(wrapper, &slots[1], SIGINT), LC_OK);
+    ASSERT_TRUE(reg(wrapper, &slots[0], SIGTERM) == LC_OK && reg(wrapper, &slots[1], SIGINT) == LC_OK);
     raise(SIGTERM);
     raise(SIGINT);
     action = [&] {
-        EXPECT_EQ(lew_event_delete(wrapper, &slots[0]), LC_OK);
-        EXPECT_EQ(lew_event_delete(wrapper, &slots[1]), LC_OK);
+        for (lew_event *&slot : slots)
+            EXPECT_EQ(lew_event_delete(wrapper, &slot), LC_OK);
         raise(SIGTERM);
     };
     EXPECT_EQ(whole(), "no events");
@@ -295,23 +262,17 @@ TEST_F(Signals, AllCanBeDeletedInTheCallbackOfOne) {
 TEST_F(Signals, BelongToOneContextAndTheirNumberIsChecked) {
     lew *other = nullptr;
     lew_event *slot = nullptr, *foreign = nullptr;
-    ASSERT_EQ(lew_init(&other), LC_OK);
-    ASSERT_EQ(reg(wrapper, &slot, SIGUSR1), LC_OK);
+    ASSERT_TRUE(lew_init(&other) == LC_OK && reg(wrapper, &slot, SIGUSR1) == LC_OK);
     for (const int number : {SIGUSR1, 0, -1, 66})
         EXPECT_EQ(reg(other, &foreign, number), LC_ASSERTION);
-    EXPECT_EQ(reg(nullptr, &foreign, SIGUSR2), LC_NULL);
-    EXPECT_EQ(foreign, nullptr);
+    EXPECT_TRUE(reg(nullptr, &foreign, SIGUSR2) == LC_NULL && !foreign);
     // A filled slot is registered again, but only in its own context.
     EXPECT_EQ(reg(other, &slot, SIGUSR2), LC_NOT_FOUND);
-    EXPECT_EQ(lew_event_delete(other, &slot), LC_NOT_FOUND);
-    EXPECT_EQ(reg(wrapper, &slot, SIGUSR2), LC_OK);
+    EXPECT_TRUE(lew_event_delete(other, &slot) == LC_NOT_FOUND && reg(wrapper, &slot, SIGUSR2) == LC_OK);
     EXPECT_EQ(le_signal_contexts[SIGUSR1], nullptr);
     EXPECT_EQ(reg(other, &foreign, SIGUSR1), LC_OK);
-    EXPECT_EQ(lew_event_cancel(other, &foreign), LC_OK);
-    EXPECT_NE(foreign, nullptr);
-    EXPECT_EQ(lew_deinit(&other), LC_OK);
-    EXPECT_EQ(foreign, nullptr);
-    EXPECT_EQ(lew_delete_all_events(wrapper), LC_OK);
+    EXPECT_TRUE(lew_event_cancel(other, &foreign) == LC_OK && foreign);
+    EXPECT_TRUE(lew_deinit(&other) == LC_OK && !foreign && lew_delete_all_events(wrapper) == LC_OK);
 }
 
 } // namespace

@@ -3,10 +3,8 @@
 
 #include <csignal>
 #include <fstream>
-#include <sstream>
 
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/un.h>
 
 #include "daemon/wccpd_service.h"
@@ -25,10 +23,8 @@ std::string content(const char *path) {
     return text.str();
 }
 
-struct DaemonMain : testing::Test {
-    daemon_engine engine;
+struct DaemonMain : daemon_test {
     void TearDown() override { unlink(PID_FILE); }
-    int said(const std::string &line) { return engine.log.count(line); }
 };
 
 TEST_F(DaemonMain, ThePidFile) {
@@ -46,19 +42,17 @@ TEST_F(DaemonMain, ThePidFile) {
 TEST_F(DaemonMain, EncapsulationRanges) {
     std::ofstream(PLATFORM_CONF_PATH) << "max_user_tunnels 78\n"; // 100 with the 22 of the system
     EXPECT_EQ(qv_encap_setup_entries(), 184u);
-    EXPECT_EQ(g_qv_encap_wccp_first, 110u);
-    EXPECT_EQ(g_qv_encap_wccp_last, 141u);
-    EXPECT_EQ(g_qv_encap_clstr_first, 151u);
-    EXPECT_EQ(g_qv_encap_clstr_last, 182u);
+    EXPECT_EQ(std::tuple(g_qv_encap_wccp_first, g_qv_encap_wccp_last, g_qv_encap_clstr_first,
+                         g_qv_encap_clstr_last),
+              std::tuple(110, 141, 151, 182));
 }
 
 TEST_F(DaemonMain, SignalsThatDoNotEndIt) {
     for (const int number : {SIGPIPE, SIGUSR1, SIGUSR2, SIGCHLD})
         EXPECT_EQ(wccpd_handle_signal(number, 0, nullptr, nullptr), LC_OK);
     EXPECT_EQ(wccpd_shutdown_in_progress(), 0);
-    EXPECT_EQ(said("Received SIGPIPE"), 1);
-    EXPECT_EQ(said("Received SIGUSR2"), 1);
-    EXPECT_EQ(said("Got unexpected signal SIGCHLD"), 1);
+    for (const char *line : {"Received SIGPIPE", "Received SIGUSR2", "Got unexpected signal SIGCHLD"})
+        EXPECT_EQ(said(line), 1) << line;
 }
 
 // Keep-alive messages stop while the engine lock is held.
@@ -67,20 +61,19 @@ TEST_F(DaemonMain, ReportsToItsServiceManager) {
     sockaddr_un address = {AF_UNIX, "\0manager"};
     ASSERT_EQ(bind(manager, reinterpret_cast<sockaddr *>(&address), sizeof(sa_family_t) + 8), 0);
     const auto received = [&] {
-        char text[64];
-        const ssize_t length = recv(manager, text, sizeof text, 0);
-        return length < 0 ? std::string() : std::string(text, static_cast<size_t>(length));
+        char text[64] = "";
+        (void)recv(manager, text, sizeof text - 1, 0);
+        return std::string(text);
     };
     setenv("NOTIFY_SOCKET", "@manager", 1);
     setenv("WATCHDOG_USEC", "48000", 1);
     setenv("WATCHDOG_PID", std::to_string(getpid()).c_str(), 1);
     service_open();
     EXPECT_EQ(getenv("NOTIFY_SOCKET"), nullptr);
-    EXPECT_EQ(service_watchdog_ms(), 48);
-    ASSERT_EQ(lew_init(&wccpd_lwc), LC_OK);
+    ASSERT_TRUE(service_watchdog_ms() == 48 && lew_init(&wccpd_lwc) == LC_OK);
     ASSERT_EQ(wccpd_service_ready(), LC_OK);
-    EXPECT_EQ(received(), "READY=1");
-    EXPECT_EQ(received(), "WATCHDOG=1");
+    for (const char *message : {"READY=1", "WATCHDOG=1"})
+        EXPECT_EQ(received(), message);
     (void)lew_dispatch_once(wccpd_lwc, nullptr, nullptr);
     EXPECT_EQ(received(), "WATCHDOG=1");
     pthread_mutex_lock(&wccp_g.lock);
@@ -93,8 +86,7 @@ TEST_F(DaemonMain, ReportsToItsServiceManager) {
 }
 
 TEST_F(DaemonMain, NothingStartsWithoutALoop) {
-    EXPECT_EQ(wccpd_serv_init(), LC_ASSERTION);
-    EXPECT_EQ(wccpd_main_loop(), LC_NULL);
+    EXPECT_TRUE(wccpd_serv_init() == LC_ASSERTION && wccpd_main_loop() == LC_NULL);
 }
 
 } // namespace

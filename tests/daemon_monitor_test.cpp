@@ -1,29 +1,20 @@
 // The monitoring tree over an engine without threads: the type and value of every node, what is listed, and
 // the answers for groups, routers and nodes that do not exist.
 #include "daemon/wccpd_monitor.h"
-#include "engine/wccp_utils.h"
 #include "runtime/list.h"
-
-#include <vector>
 
 #include "tests/support/daemon_engine.h"
 
 namespace {
-
-const std::string STATE = "/qv/wccpd/wccp/srv_grp/state";
-const std::string SYSTEM = "/qv/wccpd/system/state/";
-const std::string NOTHING = "nothing";
-
-be32 address(uint32_t last_octet) {
-    return to_be32(0x0a000000 | last_octet);
-}
+const std::string STATE = "/qv/wccpd/wccp/srv_grp/state", SYSTEM = "/qv/wccpd/system/state/",
+                  NOTHING = "nothing";
 
 // Type and text of the one binding that answers, "uint32 2" for example.
 std::string get(const std::string &name, bool in_walk = false) {
-    static const std::pair<uint32_t, const char *> types[] = {{bn_type_str, "str "},
-                                                              {bn_type_uint32, "uint32 "},
-                                                              {bn_type_ipv4addr, "ipv4addr "},
-                                                              {bn_type_duration_ms, "ms "}};
+    static const std::map<uint32_t, std::string> types = {{bn_type_str, "str "},
+                                                          {bn_type_uint32, "uint32 "},
+                                                          {bn_type_ipv4addr, "ipv4addr "},
+                                                          {bn_type_duration_ms, "ms "}};
     owner<tstr_array, tstr_array_free> parts;
     EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
     binding_list out;
@@ -35,10 +26,7 @@ std::string get(const std::string &name, bool in_walk = false) {
     uint32_t type = 0;
     EXPECT_EQ(bn_binding_get_name_quick(out.last()), name);
     EXPECT_EQ(bn_binding_get_type(out.last(), bn_attrib_value, &type, nullptr), LC_OK);
-    std::string text;
-    for (const auto &[number, word] : types)
-        text += number == type ? word : "";
-    return text + text_of([&](char **value) {
+    return types.at(type) + text_of([&](char **value) {
                return bn_binding_get_str(out.last(), bn_attrib_value, 0, nullptr, value);
            });
 }
@@ -53,8 +41,7 @@ std::string children(const std::string &name) {
     return list;
 }
 
-struct DaemonMonitor : testing::Test {
-    daemon_engine engine;
+struct DaemonMonitor : daemon_test {
     wccp_service_group *group = add_group(51);
 
     static wccp_service_group *add_group(uint8_t id) {
@@ -82,6 +69,7 @@ struct DaemonMonitor : testing::Test {
         list_push_head(&group->appliance_view, appliance);
         group->appliance_view_count++;
     }
+    // The text of a node below group 51.
     static std::string of_51(const std::string &node) { return get(STATE + "/51/" + node); }
     // "NODE VALUE; NODE VALUE" and so on. Nodes are below group 51, with a dot below the system, with a slash
     // below the state of all groups.
@@ -95,7 +83,6 @@ struct DaemonMonitor : testing::Test {
             EXPECT_EQ(get(name), wanted.substr(at + node.size() + 1, end - at - node.size() - 1)) << node;
         }
     }
-    int said(const std::string &line) { return engine.log.count(line); }
 };
 
 TEST_F(DaemonMonitor, Group) {

@@ -9,6 +9,7 @@
 #include <gtest/gtest.h>
 
 #include "engine/wccp_config.h"
+#include "engine/wccp_utils.h"
 #include "engine/wccpd_common.h"
 #include "mgmt/bnode.h"
 #include "tests/support/gcl_log.h"
@@ -37,6 +38,14 @@ struct daemon_engine {
     daemon_engine(const daemon_engine &) = delete;
     daemon_engine &operator=(const daemon_engine &) = delete;
 };
+struct daemon_test : testing::Test {
+    int said(const std::string &line) { return engine.log.count(line); } // lines that contain this text
+    daemon_engine engine;
+};
+
+constexpr be32 address(uint32_t last_octet) { // 10.0.0.x
+    return to_be32(0x0a000000 | last_octet);
+}
 
 // An array of bindings.
 struct binding_list {
