@@ -2,24 +2,13 @@
 // found, taken over and removed. The links are TUN devices of a test plane, since not every kernel has GRE.
 // Each program (a tunneld, its successor) runs as a separate process.
 
-#include <arpa/inet.h>
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <linux/if_tun.h>
 #include <linux/rtnetlink.h>
-#include <net/if.h>
-#include <sys/ioctl.h>
 #include <sys/mount.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <functional>
 #include <set>
 
 #include "peers/tunneld/kernel_links.h"
@@ -27,6 +16,7 @@
 #include "peers/tunneld/kernel_state.h"
 #include "peers/tunneld/link_names.h"
 #include "peers/tunneld/sorting_rules.h"
+#include "tests/support/test_host.h"
 
 // Replaces the rules that sort packets. It checks that the tables to which they send packets exist before the
 // rules are added, and until they are removed.
@@ -57,6 +47,8 @@ static bool needs_are_met(const wanted_sorting &sorting) {
 }
 
 namespace {
+
+using strings = std::vector<std::string>;
 
 // --- The wanted state
 
@@ -119,7 +111,7 @@ std::set<std::string> describe(const wanted_state &wanted) {
 
 struct wanted_case {
     const char *name;
-    std::vector<std::string> present, absent;
+    strings present, absent;
     std::function<void(appliance_view *)> change = [](appliance_view *) {}; // of two_tunnels()
 };
 
@@ -292,56 +284,32 @@ TEST(link_names, only_ours_are_read) {
 
 // --- The kernel
 
-// Opens a persistent TUN device, which it makes if necessary. Returns -1 on failure.
-int open_tun(const std::string &name) {
-    const int fd = open("/dev/net/tun", O_RDWR | O_CLOEXEC);
-    ifreq request = {};
-    strncpy(request.ifr_name, name.c_str(), IFNAMSIZ - 1);
-    request.ifr_flags = IFF_TUN | IFF_NO_PI;
-    if (fd >= 0 && (ioctl(fd, TUNSETIFF, &request) || ioctl(fd, TUNSETPERSIST, 1))) {
-        close(fd);
-        return -1;
-    }
-    return fd;
-}
-
 std::map<std::string, int> tuns;
 
-bool make_tun(const std::string &name, const link_wish &, uint32_t *out_index, std::string *out_error) {
+bool make_tun(const std::string &name, const link_wish &, uint32_t *out_index, std::string *) {
     if (!tuns.count(name)) {
-        const int fd = open_tun(name);
-        if (fd < 0) {
-            *out_error = "cannot make " + name;
-            return false;
-        }
-        tuns[name] = fd;
+        EXPECT_GE(tuns[name] = open_tun(name), 0);
     }
     *out_index = if_nametoindex(name.c_str());
     return true;
 }
 bool drop_tun(const std::string &name, std::string *) {
-    const auto found = tuns.find(name);
-    if (found == tuns.end())
-        return true;
-    ioctl(found->second, TUNSETPERSIST, 0);
-    close(found->second);
-    tuns.erase(found);
+    if (const auto found = tuns.extract(name)) {
+        ioctl(found.mapped(), TUNSETPERSIST, 0);
+        close(found.mapped());
+    }
     return true;
 }
 const data_plane tun_plane = {"tun", nullptr, nullptr, nullptr, make_tun, drop_tun, nullptr};
 
-// Runs `body` in a separate process, which exits without cleaning up.
+// Runs a program that does not clean up.
 void run_program(const std::function<void()> &steps) {
-    fflush(nullptr);
-    const pid_t child = fork();
-    if (child == 0) {
-        steps();
-        fflush(nullptr);
-        _exit(::testing::Test::HasFailure() ? 1 : 0);
-    }
-    int status = -1;
-    waitpid(child, &status, 0);
-    EXPECT_EQ(status, 0) << "see above";
+    EXPECT_EQ(wait_for_child(start_child([&] {
+                  steps();
+                  return testing::Test::HasFailure() ? 1 : 0;
+              })),
+              0)
+        << "see above";
 }
 
 std::string setting_file(const std::string &path) {
@@ -350,10 +318,14 @@ std::string setting_file(const std::string &path) {
 void set(const std::string &path, const std::string &value) {
     std::ofstream(setting_file(path)) << value;
 }
-std::string get(const std::string &path) {
-    std::string value;
-    std::ifstream(setting_file(path)) >> value;
-    return value;
+// The values of several settings, each of which is one character.
+std::string get(const strings &paths) {
+    std::string values, value;
+    for (const auto &path : paths) {
+        std::ifstream(setting_file(path)) >> value;
+        values += value;
+    }
+    return values;
 }
 
 // The kernel's route for a packet.
@@ -366,25 +338,21 @@ std::string route_of(const std::string &arguments) {
     return text;
 }
 
-// Counts the kernel's notifications about links, addresses, routes, rules and settings.
-struct change_listener {
-    change_listener() : fd(socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE)) {
-        const sockaddr_nl own = {AF_NETLINK, 0, 0, 0};
-        EXPECT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&own), sizeof own), 0);
-        for (const int group :
-             {RTNLGRP_LINK, RTNLGRP_IPV4_IFADDR, RTNLGRP_IPV4_ROUTE, RTNLGRP_IPV4_RULE, RTNLGRP_IPV4_NETCONF})
-            EXPECT_EQ(setsockopt(fd, SOL_NETLINK, NETLINK_ADD_MEMBERSHIP, &group, sizeof group), 0);
-    }
-    ~change_listener() { close(fd); }
-    int count() const {
-        char buffer[65536];
-        int count = 0;
-        while (recv(fd, buffer, sizeof buffer, MSG_DONTWAIT) > 0)
-            count++;
-        return count;
-    }
-    const int fd;
-};
+// Counts the kernel's notifications about links, addresses, routes, rules and settings during the steps.
+int count_changes(const std::function<void()> &steps) {
+    const int fd = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE);
+    const sockaddr_nl own = {AF_NETLINK, 0, 0,
+                             RTMGRP_LINK | RTMGRP_IPV4_IFADDR | RTMGRP_IPV4_ROUTE | RTMGRP_IPV4_RULE |
+                                 1 << (RTNLGRP_IPV4_NETCONF - 1)};
+    EXPECT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&own), sizeof own), 0);
+    steps();
+    char buffer[65536];
+    int count = 0;
+    while (recv(fd, buffer, sizeof buffer, MSG_DONTWAIT) > 0)
+        count++;
+    close(fd);
+    return count;
+}
 
 std::map<std::string, uint32_t> indices;
 std::string reconcile(const wanted_state &wanted, const data_plane &plane = tun_plane) {
@@ -419,6 +387,15 @@ std::set<std::string> links_and_tables(const wanted_state &wanted) {
             lines.insert(line);
     return lines;
 }
+void reconcile_all(const wanted_state &wanted, const data_plane &plane = tun_plane) {
+    EXPECT_EQ(reconcile(wanted, plane), "");
+    EXPECT_EQ(find_ours(), links_and_tables(wanted));
+}
+void remove_all(const data_plane &plane = tun_plane) {
+    std::string error;
+    EXPECT_TRUE(remove_kernel_state(plane, &error)) << error;
+    EXPECT_EQ(find_ours(), std::set<std::string>());
+}
 
 // Provides an interface "eth0" that is not tunneld's.
 class kernel_state : public ::testing::Test {
@@ -435,11 +412,7 @@ protected:
                 set(std::string(interface) + "/" + key, strcmp(interface, "all") == 0 ? "1" : "0");
     }
     void TearDown() override {
-        run_program([] {
-            std::string error;
-            EXPECT_TRUE(remove_kernel_state(tun_plane, &error)) << error;
-            EXPECT_EQ(find_ours(), std::set<std::string>());
-        });
+        run_program([] { remove_all(); });
         ioctl(lan, TUNSETPERSIST, 0);
         close(lan);
     }
@@ -450,46 +423,37 @@ TEST_F(kernel_state, made_once_followed_and_removed) {
     run_program([] {
         appliance_view view = two_tunnels();
         auto wanted = make_wanted_state(view, {}, true);
-        EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        reconcile_all(wanted);
         EXPECT_EQ(indices["wccp1"], if_nametoindex("wccp1"));
         for (const auto &setting : wanted.settings)
-            EXPECT_EQ(get(setting.path), setting.value) << setting.path;
+            EXPECT_EQ(get({setting.path}), setting.value) << setting.path;
 
         EXPECT_NE(route_of("iif wccp0").find("table 204801"), std::string::npos) << route_of("iif wccp0");
         EXPECT_EQ(route_of("iif wccp0 mark 0x57430001").find("local "), 0u);
         EXPECT_NE(route_of("iif wccp0 mark 0x57430002").find("dev eth0"), std::string::npos);
 
-        const change_listener changes;
-        EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(changes.count(), 0);
+        EXPECT_EQ(count_changes([&] { EXPECT_EQ(reconcile(wanted), ""); }), 0);
 
         // A tunnel gets another id and L2 return, and the other tunnel is deleted.
         const uint32_t index = indices["wccp0"];
         view.tunnels = {{30, {LOCAL, R1}}};
         view.groups[61].force_l2_return = true;
         wanted = make_wanted_state(view, wanted.links, true);
-        EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        reconcile_all(wanted);
         EXPECT_EQ(indices, (std::map<std::string, uint32_t>{{"wccp0", index}}));
 
         // An operator sets a link down, which removes its route, and then deletes the link.
         EXPECT_EQ(system("ip link set wccp0 down mtu 1400"), 0);
-        EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        reconcile_all(wanted);
         EXPECT_EQ(system("ip link delete wccp0"), 0);
-        EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        reconcile_all(wanted);
         EXPECT_EQ(indices["wccp0"], if_nametoindex("wccp0"));
 
         // A link with other ends is a new link, even if it has the same number.
         wanted.links[0].wish.remote = OTHER;
-        EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        reconcile_all(wanted);
 
-        std::string error;
-        EXPECT_TRUE(remove_kernel_state(tun_plane, &error)) << error;
-        EXPECT_EQ(find_ours(), std::set<std::string>());
+        remove_all();
         EXPECT_FALSE(std::filesystem::exists("/run/tunneld/settings"));
     });
 }
@@ -524,8 +488,7 @@ TEST_F(kernel_state, what_a_killed_program_leaves_is_taken_over) {
         const auto before = find_own_links();
         EXPECT_EQ(before, (std::vector<wanted_link>{{"wccp0", {3, LOCAL, R1}}}));
         const auto wanted = make_wanted_state(view, before, true);
-        EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        reconcile_all(wanted);
         EXPECT_EQ(indices, (std::map<std::string, uint32_t>{{"wccp0", index}, {"wccp1", unmarked}}));
         EXPECT_NE(if_nametoindex("tun3"), 0u);
         EXPECT_EQ(system("ip rule show preference 2051 | grep -q 192.0.2.8 && ip route show table 204806 | "
@@ -533,12 +496,12 @@ TEST_F(kernel_state, what_a_killed_program_leaves_is_taken_over) {
                          "&& ip rule delete preference 2051 from 192.0.2.8 && ip link delete tun3 && "
                          "ip route flush table 204806"),
                   0);
-        std::string error;
-        EXPECT_TRUE(remove_kernel_state(tun_plane, &error)) << error;
+        remove_all();
     });
 }
 
 TEST_F(kernel_state, settings_come_back) {
+    const strings filters = {"all/rp_filter", "eth0/rp_filter", "lan1/rp_filter", "default/rp_filter"};
     set("default/rp_filter", "2");
     close(open_tun("lan1"));
     set("lan1/rp_filter", "0");
@@ -547,11 +510,9 @@ TEST_F(kernel_state, settings_come_back) {
     const auto wanted = make_wanted_state(view, {}, true);
     run_program([&] {
         EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(get("all/rp_filter") + get("eth0/rp_filter") + get("lan1/rp_filter") +
-                      get("default/rp_filter"),
-                  "0112");
-        EXPECT_EQ(get("eth0/forwarding") + get("eth0/accept_local") + get("eth0/send_redirects"), "110");
-        EXPECT_EQ(get("lan1/send_redirects"), "1"); // as `all` had it
+        EXPECT_EQ(get(filters), "0112");
+        EXPECT_EQ(get({"eth0/forwarding", "eth0/accept_local", "eth0/send_redirects"}), "110");
+        EXPECT_EQ(get({"lan1/send_redirects"}), "1"); // as `all` had it
     });
     // The program was killed, an operator has changed a setting, and the file has invalid lines.
     set("lan1/rp_filter", "2");
@@ -563,15 +524,10 @@ TEST_F(kernel_state, settings_come_back) {
         EXPECT_EQ(reconcile(wanted), ""); // the values found now are not the ones to restore
         view.groups[61].routers[0].forward = travel::gre;
         EXPECT_EQ(reconcile(make_wanted_state(view, wanted.links, true)), "");
-        EXPECT_EQ(get("eth0/forwarding") + get("eth0/accept_local") + get("all/rp_filter") +
-                      get("eth0/rp_filter"),
-                  "0001");
-        std::string error;
-        EXPECT_TRUE(remove_kernel_state(tun_plane, &error)) << error;
-        EXPECT_EQ(get("all/rp_filter") + get("eth0/rp_filter") + get("lan1/rp_filter") +
-                      get("default/rp_filter"),
-                  "1022");
-        EXPECT_EQ(get("all/send_redirects") + get("eth0/send_redirects") + get("lan1/send_redirects"), "100");
+        EXPECT_EQ(get({"eth0/forwarding", "eth0/accept_local", "all/rp_filter", "eth0/rp_filter"}), "0001");
+        remove_all();
+        EXPECT_EQ(get(filters), "1022");
+        EXPECT_EQ(get({"all/send_redirects", "eth0/send_redirects", "lan1/send_redirects"}), "100");
         EXPECT_EQ(system("ls /run/tunneld/* 2>/dev/null"), 2 << 8);
     });
     EXPECT_EQ(system("ip link delete lan1"), 0);
@@ -593,7 +549,7 @@ TEST_F(kernel_state, failures_are_reported_and_the_rest_is_done) {
         EXPECT_EQ(find_ours(), expected);
         EXPECT_EQ(reconcile(wanted),
                   "cannot add the default route of table 204801 (eth7 via 10.0.0.17): No such device");
-        EXPECT_EQ(get("wccp0/accept_local"), "1");
+        EXPECT_EQ(get({"wccp0/accept_local"}), "1");
     });
 }
 
@@ -602,8 +558,7 @@ TEST(kernel_plane, makes_gre_links_or_says_why_not) {
     std::string error;
     auto wanted = make_wanted_state(two_tunnels(), {}, false);
     const auto reconcile_gre = [&] {
-        EXPECT_EQ(reconcile(wanted, kernel_plane), "");
-        EXPECT_EQ(find_ours(), links_and_tables(wanted));
+        reconcile_all(wanted, kernel_plane);
         std::vector<found_link> links;
         find_links(false, &links);
         for (const auto &link : links)
@@ -621,9 +576,7 @@ TEST(kernel_plane, makes_gre_links_or_says_why_not) {
     close(open_tun("wccp0")); // left behind by the other plane
     run_program([&] {
         reconcile_gre();
-        const change_listener changes;
-        reconcile_gre();
-        EXPECT_EQ(changes.count(), 0);
+        EXPECT_EQ(count_changes(reconcile_gre), 0);
     });
     run_program([&] {
         const uint32_t index = if_nametoindex("wccp0");
@@ -640,8 +593,7 @@ TEST(kernel_plane, makes_gre_links_or_says_why_not) {
         plane_counters counters;
         kernel_plane.read_counters(&counters);
         EXPECT_EQ(counters.links.size(), 2u);
-        EXPECT_TRUE(remove_kernel_state(kernel_plane, &error)) << error;
-        EXPECT_EQ(find_ours(), std::set<std::string>());
+        remove_all(kernel_plane);
     });
 }
 
