@@ -1,31 +1,21 @@
 // The sorting rules in the kernel. TUN devices stand for a link, an L2 interface, the default route and a
 // link to another appliance; a proxy's sockets listen.
 
-#include <arpa/inet.h>
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <linux/if.h>
-#include <linux/if_tun.h>
-#include <netinet/in.h>
-#include <netinet/tcp.h>
 #include <poll.h>
-#include <sys/ioctl.h>
-#include <sys/socket.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <cstdlib>
-#include <cstring>
 #include <ctime>
-#include <functional>
 
 #include "peers/tunneld/nft_commands.h"
 #include "peers/tunneld/sorting_rules.h"
+#include "tests/support/packets.h"
+#include "tests/support/test_host.h"
+#include "tests/support/wire_bytes.h"
 
 namespace {
 
+constexpr uint8_t FIN = TCP_FIN, SYN = TCP_SYN, ACK = TCP_ACK;
 constexpr sorted_as TO_PROXY = SORTED_TO_PROXY, RETURNED = SORTED_RETURNED;
-constexpr uint8_t FIN = 1, SYN = 2, ACK = 16;
 constexpr uint32_t CLIENT = 0xAC100005, SERVER = 0xC6336405, OWN = 0x0A000001, ROUTER = 0xC0000201;
 constexpr uint32_t SPARED = 0x0A090101, BYPASSED = 0xCB007107; // bypassed for a group, and for all
 
@@ -37,68 +27,25 @@ struct packet {
     std::string text = "";
 };
 
-uint16_t checksum(const std::string &bytes, uint32_t sum = 0) {
-    for (size_t i = 0; i < bytes.size(); i++)
-        sum += static_cast<uint32_t>(static_cast<uint8_t>(bytes[i])) << (i % 2 ? 0 : 8);
-    while (sum >> 16)
-        sum = (sum & 0xffff) + (sum >> 16);
-    return static_cast<uint16_t>(~sum);
-}
-void put(std::string &bytes, uint64_t value, int size) {
-    while (size-- > 0)
-        bytes += static_cast<char>(value >> (8 * size));
-}
-uint32_t get(const std::string &bytes, size_t at, size_t size) {
+uint32_t get(const bytes &packet, size_t at, size_t size) {
     uint32_t value = 0;
-    for (size_t i = at; i < at + size && i < bytes.size(); i++)
-        value = value << 8 | static_cast<uint8_t>(bytes[i]);
+    for (size_t i = at; i < at + size && i < packet.size(); i++)
+        value = value << 8 | packet[i];
     return value;
 }
-std::string ip_packet(uint32_t source, uint32_t destination, uint8_t protocol, const std::string &body,
-                      uint16_t fragment = 0) {
-    std::string bytes;
-    put(bytes, 0x4500, 2);
-    put(bytes, 20 + body.size(), 2);
-    put(bytes, 7, 2);
-    put(bytes, fragment, 2);
-    put(bytes, 64 << 8 | protocol, 2);
-    put(bytes, 0, 2);
-    put(bytes, source, 4);
-    put(bytes, destination, 4);
-    const uint16_t sum = checksum(bytes);
-    bytes[10] = static_cast<char>(sum >> 8);
-    bytes[11] = static_cast<char>(sum);
-    return bytes + body;
-}
-std::string make_bytes(const packet &what) {
-    std::string body;
-    put(body, what.from, 2);
-    put(body, what.port, 2);
-    size_t sum_at = 6;
-    if (what.protocol == 17) {
-        put(body, 8 + what.text.size(), 2);
-        put(body, 0, 2);
-    } else {
-        const bool syn = what.flags & SYN;
-        put(body, what.sequence, 4);
-        put(body, what.acknowledged, 4);
-        put(body, (syn ? 6u : 5u) << 12 | what.flags, 2);
-        put(body, 65535, 2);
-        put(body, 0, 4);
-        if (syn)
-            put(body, 0x020405B4, 4);
-        sum_at = 16;
-    }
-    body += what.text;
-    std::string pseudo;
-    put(pseudo, what.source, 4);
-    put(pseudo, what.destination, 4);
-    put(pseudo, what.protocol, 2);
-    put(pseudo, body.size(), 2);
-    const uint16_t sum = checksum(pseudo + body);
-    body[sum_at] = static_cast<char>(sum >> 8);
-    body[sum_at + 1] = static_cast<char>(sum);
-    return ip_packet(what.source, what.destination, what.protocol, body);
+bytes make_bytes(const packet &what) {
+    wire_bytes body;
+    body.u16(what.from).u16(what.port);
+    const bool syn = what.flags & SYN;
+    if (what.protocol == PROTOCOL_UDP)
+        body.zeros(4);
+    else
+        body.u32(what.sequence).u32(what.acknowledged).u8(syn ? 0x60 : 0x50).u8(what.flags).hex("ffff 00*4");
+    if (syn && what.protocol != PROTOCOL_UDP)
+        body.hex("020405b4");
+    for (const char letter : what.text)
+        body.u8(static_cast<uint8_t>(letter));
+    return make_ip_packet(what.protocol, what.source, what.destination, body.bytes);
 }
 
 enum device { LINK, LAN, OUT, MEMBER, DEVICES };
@@ -107,51 +54,42 @@ constexpr uint32_t PASSED_ON = MARK_PASS + 9;
 int devices[DEVICES];
 uint16_t next_port = 20000;
 
-int open_tun(const char *name) {
-    const int fd = open("/dev/net/tun", O_RDWR | O_NONBLOCK | O_CLOEXEC);
-    ifreq request{};
-    strncpy(request.ifr_name, name, IFNAMSIZ - 1);
-    request.ifr_flags = IFF_TUN | IFF_NO_PI;
-    return ioctl(fd, TUNSETIFF, &request) == 0 ? fd : -1;
-}
-
-void give(device where, const std::string &bytes) {
-    ASSERT_EQ(write(devices[where], bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+void give(device where, const bytes &sent) {
+    ASSERT_EQ(write(devices[where], sent.data(), sent.size()), static_cast<ssize_t>(sent.size()));
 }
 
 // The next packet from any device that `wanted` accepts. The kernel handles a packet, including the answer,
 // while it is written: waiting is necessary only on a busy machine.
-std::string take(const std::function<bool(const std::string &)> &wanted, device *out_where, int ms = 60) {
+bytes take(const std::function<bool(const bytes &)> &wanted, device *out_where, int ms = 60) {
     pollfd fds[DEVICES];
     for (int i = 0; i < DEVICES; i++)
         fds[i] = {devices[i], POLLIN, 0};
     while (poll(fds, DEVICES, ms) > 0)
         for (int i = 0; i < DEVICES; i++) {
-            char buffer[2048];
-            const ssize_t length = fds[i].revents ? read(devices[i], buffer, sizeof(buffer)) : 0;
-            const std::string bytes(buffer, length > 0 ? static_cast<size_t>(length) : 0);
+            bytes got(2048);
+            const ssize_t length = fds[i].revents ? read(devices[i], got.data(), got.size()) : 0;
+            got.resize(length > 0 ? static_cast<size_t>(length) : 0);
             *out_where = static_cast<device>(i);
-            if (!bytes.empty() && bytes[0] == 0x45 && wanted(bytes))
-                return bytes;
+            if (!got.empty() && got[0] == 0x45 && wanted(got))
+                return got;
         }
-    return "";
+    return {};
 }
 
 void drain() {
     device where;
-    take([](const std::string &) { return false; }, &where, 0);
+    take([](const bytes &) { return false; }, &where, 0);
 }
 
-int listen_on(int type, uint32_t address, uint16_t port) {
+int bind_transparent(int type, uint32_t address, uint16_t port) {
     const int fd = socket(AF_INET, type | SOCK_NONBLOCK | SOCK_CLOEXEC, 0), on = 1;
     setsockopt(fd, IPPROTO_IP, IP_TRANSPARENT, &on, sizeof(on));
-    sockaddr_in name{};
-    name.sin_family = AF_INET;
-    name.sin_addr.s_addr = htonl(address);
-    name.sin_port = htons(port);
-    EXPECT_EQ(bind(fd, reinterpret_cast<sockaddr *>(&name), sizeof(name)), 0) << strerror(errno);
-    if (type == SOCK_STREAM)
-        listen(fd, 100);
+    EXPECT_EQ(bind_to(fd, address, port), 0) << strerror(errno);
+    return fd;
+}
+int listen_on(uint32_t address, uint16_t port) {
+    const int fd = bind_transparent(SOCK_STREAM, address, port);
+    listen(fd, 100);
     return fd;
 }
 
@@ -182,7 +120,7 @@ wanted_sorting make_wanted() {
 struct Sorting : testing::Test {
     static void SetUpTestSuite() {
         for (int i = 0; i < DEVICES; i++)
-            ASSERT_GE(devices[i] = open_tun(device_names[i]), 0);
+            ASSERT_GE(devices[i] = open_tun(device_names[i], O_NONBLOCK), 0);
         ASSERT_EQ(
             system(
                 "set -e; cd /proc/sys/net/ipv4/conf; echo 0 >all/rp_filter; ip addr add 10.0.0.1/32 dev lo\n"
@@ -198,9 +136,9 @@ struct Sorting : testing::Test {
                 "ip rule add pref 2051 iif wccp0 lookup 204801\n"
                 "ip rule add pref 2051 iif wccp9 lookup 204801"),
             0);
-        listen_on(SOCK_STREAM, INADDR_ANY, 3128);
-        listen_on(SOCK_STREAM, INADDR_LOOPBACK, 3129);
-        udp = listen_on(SOCK_DGRAM, INADDR_ANY, 3128);
+        listen_on(INADDR_ANY, 3128);
+        listen_on(INADDR_LOOPBACK, 3129);
+        udp = bind_transparent(SOCK_DGRAM, INADDR_ANY, 3128);
     }
     ~Sorting() override {
         std::string error;
@@ -219,16 +157,15 @@ struct Sorting : testing::Test {
     }
     // Sends a packet and returns the result: the device from which it was read, "answer" or "refused" for a
     // reply of a TCP socket, "datagram" for the UDP socket, or "".
-    static std::string send(packet what, device by = LINK, std::string *out_answer = nullptr) {
+    static std::string send(packet what, device by = LINK, bytes *out_answer = nullptr) {
         if (what.from == 0)
             what.from = next_port++;
         drain();
         give(by, make_bytes(what));
         device where = DEVICES;
-        const std::string got = take(
-            [&](const std::string &bytes) {
-                return bytes.size() >= 28 &&
-                       (get(bytes, 20, 2) == what.from || get(bytes, 22, 2) == what.from);
+        const bytes got = take(
+            [&](const bytes &each) {
+                return each.size() >= 28 && (get(each, 20, 2) == what.from || get(each, 22, 2) == what.from);
             },
             &where);
         char buffer[64];
@@ -293,7 +230,8 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
     };
     static const auto pass_everything = [](W &w) { w.groups[0].pass_marks = {PASSED_ON}; };
     static const auto clear_groups = [](W &w) { w.groups.clear(); };
-    static const struct {
+    const auto from_port = [](uint16_t port) { return packet{.flags = ACK, .port = 50000, .from = port}; };
+    const struct {
         const char *what;
         packet given;
         device by;
@@ -337,20 +275,8 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
         {"chosen by the plane", {.flags = ACK}, MEMBER, "wccp0", SORTED_PASSED, 0, choose_passing},
         {"by all four fields", {.flags = ACK, .from = 40000}, LINK, "wccp9", SORTED_PASSED, 5, pass_slot_15},
         {"one slot for all", {.flags = ACK}, LINK, "wccp9", SORTED_PASSED, 5, pass_everything},
-        {"an answer",
-         {.flags = ACK, .port = 50000, .from = 81},
-         LINK,
-         "wccp9",
-         SORTED_PASSED,
-         6,
-         pass_answers},
-        {"another answer",
-         {.flags = ACK, .port = 50000, .from = 82},
-         LINK,
-         "wccp0",
-         RETURNED,
-         0,
-         pass_answers},
+        {"an answer", from_port(81), LINK, "wccp9", SORTED_PASSED, 6, pass_answers},
+        {"another answer", from_port(82), LINK, "wccp0", RETURNED, 0, pass_answers},
         {"no groups", {}, LINK, "wccp0", RETURNED, 0, clear_groups},
     };
     for (const auto &row : rows) {
@@ -375,12 +301,12 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
 }
 
 TEST_F(Sorting, AFlowStaysWithItsSocket) {
-    const int listener = listen_on(SOCK_STREAM, INADDR_ANY, 3130);
+    const int listener = listen_on(INADDR_ANY, 3130);
     wanted_sorting wanted = make_wanted();
     wanted.groups[0].rules.to = 3130;
     apply(wanted);
     packet next{.from = next_port++};
-    std::string answer;
+    bytes answer;
     ASSERT_EQ(send(next, LINK, &answer), "answer");
     EXPECT_EQ(get(answer, 40, 4), 0x02040000u | wanted.mss); // the segment size fits the tunnel
     EXPECT_EQ(counters().clamped, 1);
@@ -422,19 +348,12 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
 TEST_F(Sorting, TheProxysOwnFlowIsKnownAgain) {
     apply(make_wanted());
     const uint16_t port = next_port++;
-    const int client = socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0), on = 1;
-    setsockopt(client, IPPROTO_IP, IP_TRANSPARENT, &on, sizeof(on));
-    sockaddr_in name{};
-    name.sin_family = AF_INET;
-    name.sin_addr.s_addr = htonl(CLIENT);
-    name.sin_port = htons(port);
-    ASSERT_EQ(bind(client, reinterpret_cast<sockaddr *>(&name), sizeof(name)), 0);
-    name.sin_addr.s_addr = htonl(SERVER);
-    name.sin_port = htons(80);
-    connect(client, reinterpret_cast<sockaddr *>(&name), sizeof(name));
+    const int client = bind_transparent(SOCK_STREAM, CLIENT, port);
+    const sockaddr_in name = address_of(SERVER, 80);
+    connect(client, reinterpret_cast<const sockaddr *>(&name), sizeof(name));
     device where = DEVICES;
-    const auto is_its_own = [&](const std::string &bytes) { return get(bytes, 20, 2) == port; };
-    const std::string syn = take(is_its_own, &where);
+    const auto is_its_own = [&](const bytes &each) { return get(each, 20, 2) == port; };
+    const bytes syn = take(is_its_own, &where);
     ASSERT_EQ(where, OUT);
     give(LINK, syn);
     EXPECT_EQ(take(is_its_own, &where).size(), syn.size());
@@ -446,19 +365,19 @@ TEST_F(Sorting, TheProxysOwnFlowIsKnownAgain) {
 
 TEST_F(Sorting, OuterPacketsAreCounted) {
     wanted_sorting wanted = make_wanted();
-    const std::string gre = ip_packet(ROUTER, OWN, 47, std::string("\0\0\x08\0", 4) + make_bytes({}));
-    const std::string strange = ip_packet(ROUTER + 1, OWN, 47, std::string("\0\0\x08\0", 4) + make_bytes({}));
-    const auto is_icmp = [](const std::string &bytes) { return bytes[9] == 1; };
+    bytes gre = hex("0000 0800").bytes, inner = make_bytes({}), junk(64, 'x');
+    gre.insert(gre.end(), inner.begin(), inner.end());
+    const auto is_icmp = [](const bytes &each) { return each[9] == 1; };
     device where;
     for (const bool drop : {false, true}) {
         wanted.drop_outer_gre = drop;
         apply(wanted);
         drain();
-        give(OUT, gre);
+        give(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, gre));
         EXPECT_EQ(take(is_icmp, &where).empty(), drop); // protocol unreachable: this kernel has no GRE
-        give(OUT, strange);
-        give(OUT, ip_packet(ROUTER, OWN, 47, std::string(64, 'x'), 0x2000));
-        give(OUT, ip_packet(ROUTER, OWN, 47, std::string(64, 'x'), 8));
+        give(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER + 1, OWN, gre));
+        give(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, junk, 0x2000));
+        give(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, junk, 8));
     }
     sorting_counters read = counters();
     EXPECT_EQ(read.fragments, (std::map<tunnel_ends, uint64_t>{{{OWN, ROUTER}, 4}}));
@@ -475,19 +394,16 @@ TEST_F(Sorting, ChangesAreWholeOrNone) {
     wanted.members.clear();
     std::string error;
     EXPECT_TRUE(remove_sorting_rules(&error)) << error;
-    const pid_t child = fork();
-    if (child == 0) {
-        wanted_sorting earlier = wanted;
-        earlier.links = {"wccp0", "wccp9"};
-        earlier.groups[0].interfaces.push_back("wccp9");
-        earlier.groups.push_back(make_group(9, 6, {}));
-        apply(earlier);
-        _exit(send({.port = 443}) == "answer" && send({}) == "answer" ? 0 : 1);
-    }
-    int status = -1;
-    waitpid(child, &status, 0);
+    ASSERT_EQ(wait_for_child(start_child([&wanted] {
+                  wanted_sorting earlier = wanted;
+                  earlier.links = {"wccp0", "wccp9"};
+                  earlier.groups[0].interfaces.push_back("wccp9");
+                  earlier.groups.push_back(make_group(9, 6, {}));
+                  apply(earlier);
+                  return send({.port = 443}) == "answer" && send({}) == "answer" ? 0 : 1;
+              })),
+              0);
     next_port += 2;
-    ASSERT_EQ(status, 0);
     apply(wanted);
     sorting_counters read = counters();
     EXPECT_EQ(read.interfaces["wccp0"][TO_PROXY].packets, 2);
