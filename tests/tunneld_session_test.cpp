@@ -2,25 +2,19 @@
 // loop.
 #include <filesystem>
 #include <fstream>
-#include <thread>
 
-#include <arpa/inet.h>
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
-#include "mgmt/bnode_proto.h"
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/transport.h"
 #include "peers/tunneld/course.h"
 #include "peers/tunneld/flow_count.h"
 #include "peers/tunneld/health.h"
-#include "peers/tunneld/session.h"
 #include "peers/tunneld/session_config.h"
 #include "peers/tunneld/slot_owners.h"
 #include "runtime/ttime.h"
+#include "tests/support/test_host.h"
 
 using strings = std::vector<std::string>;
 
@@ -57,21 +51,19 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
         field(NODE_PROTECTION_TIME, "60"),
     };
     strings complaints;
-    configured_view view = read_configuration(nodes, &complaints);
+    configured_view expected;
+    expected.groups = {{51, {"eth0", 0, 0, true, {}}}, {52, {}}};
+    expected.intercepts[51] = {.protocol = 17,
+                               .ports = {{53, 53}, {8000, 8080}},
+                               .to = 3128,
+                               .bypass = {{0x0a000000, 8}, {0xc0000201, 32}},
+                               .drop_when_down = true,
+                               .check = {check_kind::http, "/health"}};
+    expected.bypasses = {{{0x0a000000, 8}, 99}};
+    expected.accepted = {{0xc0000209, 0xc0000201}};
+    expected.protection_s = 60;
+    EXPECT_EQ(read_configuration(nodes, &complaints), expected);
     EXPECT_EQ(complaints.size(), 7u) << testing::PrintToString(complaints);
-    ASSERT_EQ(view.intercepts.size(), 1u);
-    const intercept &rules = view.intercepts[51];
-    EXPECT_EQ(rules.protocol, 17);
-    EXPECT_EQ(rules.ports, (std::vector<port_range>{{53, 53}, {8000, 8080}}));
-    EXPECT_EQ(rules.bypass, (std::vector<ip_prefix>{{0x0a000000, 8}, {0xc0000201, 32}}));
-    EXPECT_TRUE(rules.drop_when_down && rules.check.kind == check_kind::http);
-    EXPECT_EQ(rules.check.interval_s, 5u);
-    EXPECT_EQ(view.bypasses, (std::vector<bypass_entry>{{{0x0a000000, 8}, 99}}));
-    EXPECT_EQ(view.accepted, (std::vector<accepted_source>{{0xc0000209, 0xc0000201}}));
-    EXPECT_EQ(view.protection_s, 60u);
-    EXPECT_EQ(view.groups.size(), 2u);
-    EXPECT_EQ(view.groups[51], (group_view{"eth0", 0, 0, true, {}}));
-    EXPECT_EQ(view.groups[52].interface, "");
 
     // The name of a command's file may contain blanks, which mgmtd allows; the path of a page may not.
     nodes[10].value.text = "/opt/a check";
@@ -107,12 +99,10 @@ TEST(SlotOwners, TextIsReadWholeOrNotAtAll) {
     for (int i = 0; i < 33; i++)
         many += " 10.0.0.1";
     for (const std::string &bad :
-         {std::string(), std::string("hash"), std::string("hash members 0.0.0.0"), many,
-          std::string("hash members 10.0.0.1 owners 10.0.0.1*255"),
-          std::string("hash members 10.0.0.1 owners 10.0.0.1*256 10.0.0.1*1"),
-          std::string("hash members 10.0.0.1 owners 10.0.0.1*-1"),
-          std::string("mask ff 0 0 0 members 10.0.0.1"), std::string("mask 1 0 0 10000 members 10.0.0.1"),
-          std::string("mask 1 0 0 members 10.0.0.1")})
+         strings{"", "hash", "hash members 0.0.0.0", many, "hash members 10.0.0.1 owners 10.0.0.1*255",
+                 "hash members 10.0.0.1 owners 10.0.0.1*256 10.0.0.1*1",
+                 "hash members 10.0.0.1 owners 10.0.0.1*-1", "mask ff 0 0 0 members 10.0.0.1",
+                 "mask 1 0 0 10000 members 10.0.0.1", "mask 1 0 0 members 10.0.0.1"})
         EXPECT_FALSE(parse_owners(bad, &report)) << bad;
 }
 
@@ -287,31 +277,31 @@ struct Session : Loop {
         asked.clear();
     }
     void answer_for_wccpd() {
-        const std::string group = NODE_GROUP_STATE "/51";
-        while (!asked.empty()) {
-            const owned_request msg(asked.front());
-            asked.erase(asked.begin());
+        for (bn_request_msg *each : std::exchange(asked, {})) {
+            const owned_request msg(each);
             owned_response response;
             owned_tbuffer frame;
             ASSERT_EQ(bn_query_response_msg_create(&response.pointer, msg.pointer->msg_id, 0, nullptr),
                       LC_OK);
-            const auto add = [&](uint32_t id, const std::string &name, const std::string &text) {
-                owned_binding binding(make_binding(name, {bn_type_str, text}));
-                (void)bn_query_response_msg_append_binding_takeover(response.pointer, &binding.pointer, id);
+            uint32_t id = 0;
+            const auto add = [&](const std::string &name, const std::string &text) {
+                bn_binding *binding = make_binding(name, {bn_type_str, text});
+                (void)bn_query_response_msg_append_binding_takeover(response.pointer, &binding, id);
             };
             int walks = 0;
             for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(msg.pointer->nodes); i++) {
                 const bn_request_node *node = bn_request_per_node_array_get_quick(msg.pointer->nodes, i);
                 const std::string name = name_of(node->binding);
-                for (int id = 31; id <= 51 && name == NODE_GROUP_STATE; id++)
-                    add(node->node_id, name + "/" + std::to_string(id), std::to_string(id));
-                if (name == group + "/owners")
-                    add(node->node_id, group + "/owners", "hash members 192.0.2.3");
+                id = node->node_id;
+                for (int group = 31; group <= 51 && name == NODE_GROUP_STATE; group++)
+                    add(name + "/" + std::to_string(group), std::to_string(group));
+                if (name == NODE_GROUP_STATE "/51/owners")
+                    add(name, "hash members 192.0.2.3");
                 if (name.ends_with("/router") && node->subop == bn_query_iterate) {
-                    add(node->node_id, name + "/1/id", "192.0.2.1");
-                    add(node->node_id, name + "/1/ipaddr", "192.0.2.2");
-                    add(node->node_id, name + "/1/fwd_method", method == "L2" ? "GRE" : method);
-                    add(node->node_id, name + "/1/ret_method", method);
+                    add(name + "/1/id", "192.0.2.1");
+                    add(name + "/1/ipaddr", "192.0.2.2");
+                    add(name + "/1/fwd_method", method == "L2" ? "GRE" : method);
+                    add(name + "/1/ret_method", method);
                     walks++;
                 }
             }
@@ -434,21 +424,18 @@ TEST_F(Session, AnswersForItsStateAndReports) {
     EXPECT_EQ(std::count(all.begin(), all.end(), NODE_TUNNEL_STATE "/3/index=7"), 1);
 
     // mgmtd reports an orderly end, unless it has started the process and sees the end itself.
-    const auto ends_are = [&](size_t count) {
-        size_t found_lines = 0;
-        for (size_t at = 0; (at = said.find("process tunneld: " EVENT_PROCESS_TERMINATE, at)) != said.npos;
-             at++)
-            found_lines++;
-        return found_lines == count;
+    const auto is_reported = [&] {
+        return said.find("process tunneld: " EVENT_PROCESS_TERMINATE) != said.npos;
     };
     mgmt_link_ends(link);
-    EXPECT_TRUE(wait_until([&] { return ends_are(1); })) << said;
+    EXPECT_TRUE(wait_until(is_reported)) << said;
+    said.clear();
     bool asked_whether = false;
     daemon->is_news = [&](const std::string &process) {
         return (asked_whether = process == "tunneld", false);
     };
     mgmt_link_ends(link);
-    EXPECT_TRUE(wait_until([&] { return asked_whether; }) && ends_are(1)) << said;
+    EXPECT_TRUE(wait_until([&] { return asked_whether; }) && !is_reported()) << said;
 }
 
 // --- Health
@@ -464,11 +451,9 @@ struct proxy {
     int resets = 0;
 
     proxy() : listener(socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0)) {
-        sockaddr_in address{};
+        sockaddr_in address = {};
         socklen_t length = sizeof address;
-        address.sin_family = AF_INET;
-        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        EXPECT_EQ(bind(listener, reinterpret_cast<sockaddr *>(&address), length), 0);
+        EXPECT_EQ(bind_to(listener, INADDR_LOOPBACK), 0);
         EXPECT_EQ(listen(listener, 300), 0);
         EXPECT_EQ(getsockname(listener, reinterpret_cast<sockaddr *>(&address), &length), 0);
         port = ntohs(address.sin_port);
@@ -477,8 +462,6 @@ struct proxy {
         end();
         close(listener);
     }
-    proxy(const proxy &) = delete;
-    proxy &operator=(const proxy &) = delete;
     void end() {
         for (const int fd : clients)
             close(fd);
@@ -525,17 +508,17 @@ struct Health : Loop {
         health_set_checks(monitor, {{51, rules}});
     }
     std::string path(const char *name) const { return std::string(directory) + "/" + name; }
-    std::string script(const std::string &content) const {
-        std::ofstream(path("check")) << "#!/bin/sh\n" << content << "\n";
-        chmod(path("check").c_str(), 0755);
-        return path("check");
-    }
     // Sets a check and returns the state after its first result.
     std::string first_result(const health_check &check, uint16_t port) const {
         health_set_checks(monitor, {});
         watch(check, port);
         EXPECT_TRUE(wait_until([&] { return state(51).checks == 1; })) << check.argument;
         return state(51).state == proxy_health::up ? "up" : state(51).reason;
+    }
+    std::string result_of_script(const std::string &content) const {
+        std::ofstream(path("check")) << "#!/bin/sh\n" << content << "\n";
+        chmod(path("check").c_str(), 0755);
+        return first_result({check_kind::command, path("check"), 1, 1, 1}, 1);
     }
 };
 } // namespace
@@ -581,20 +564,14 @@ TEST_F(Health, EachKindOfCheckHasItsReasons) {
     EXPECT_EQ(first_result(http, server.port), "no HTTP answer");
 
     setenv("SECRET", "1", 1);
-    EXPECT_EQ(
-        first_result(
-            {check_kind::command, script("test -z \"$SECRET\" && test ! -e /proc/self/fd/4"), 1, 1, 1}, 1),
-        "up");
-    EXPECT_EQ(first_result({check_kind::command, script("exit 3"), 1, 1, 1}, 1), "exit status 3");
-    EXPECT_EQ(first_result({check_kind::command, script("kill -9 $$"), 1, 1, 1}, 1), "ended by SIGKILL");
+    EXPECT_EQ(result_of_script("test -z \"$SECRET\" && test ! -e /proc/self/fd/4"), "up");
+    EXPECT_EQ(result_of_script("exit 3"), "exit status 3");
+    EXPECT_EQ(result_of_script("kill -9 $$"), "ended by SIGKILL");
     EXPECT_EQ(first_result({check_kind::command, path("none"), 1, 1, 1}, 1),
               path("none") + ": No such file or directory");
     // A command's children are killed when it ends, and when its time is up.
-    for (const auto &[content, result] : {std::pair{"sleep 100 & echo $! >PID", "up"},
-                                          {"sleep 100 & echo $! >PID; wait", "no answer in 1000 ms"}}) {
-        std::string text = content;
-        text.replace(text.find("PID"), 3, path("pid"));
-        EXPECT_EQ(first_result({check_kind::command, script(text), 1, 1, 1}, 1), result);
+    for (const auto &[after, result] : {std::pair{"", "up"}, {"; wait", "no answer in 1000 ms"}}) {
+        EXPECT_EQ(result_of_script("sleep 100 & echo $! >" + path("pid") + after), result);
         std::ifstream file(path("pid"));
         pid_t pid = 0;
         file >> pid;
@@ -613,30 +590,26 @@ TEST_F(Health, EachKindOfCheckHasItsReasons) {
 TEST(Course, WeightsLimitsAndDrainsFollowTheFacts) {
     course one;
     int64_t at_s = 0;
-    const auto look = [&](const char *when, course_facts facts) {
+    const auto look = [&](const char *when, course_facts now) {
         SCOPED_TRACE(std::string(when) + " at " + std::to_string(at_s));
-        facts.now_ms = at_s++ * 1000;
-        const course_decision decided = follow_course(&one, facts);
+        now.now_ms = at_s++ * 1000;
+        const course_decision decided = follow_course(&one, now);
         return std::to_string(decided.weight_percent) + (decided.overloaded ? " overloaded" : "") +
                (decided.empty ? " empty" : "");
     };
-    const course_facts idle = {.now_ms = 0, .slow_start_s = 40, .limit = 100};
-    const auto with = [&](auto change) {
-        course_facts facts = idle;
-        facts.active = true;
-        change(&facts);
-        return facts;
+    const auto facts = [](bool active, uint32_t flows = 0, bool draining = false, bool alone = false) {
+        return course_facts{.now_ms = 0,
+                            .draining = draining,
+                            .active = active,
+                            .alone = alone,
+                            .flows = flows,
+                            .slow_start_s = 40,
+                            .limit = 100};
     };
-    const course_facts works = with([](course_facts *) {});
-    const auto has = [&](uint32_t flows) { return with([=](course_facts *f) { f->flows = flows; }); };
-    const auto drains = [&](uint32_t flows, bool active, bool alone) {
-        return with([=](course_facts *f) {
-            f->draining = true;
-            f->flows = flows;
-            f->active = active;
-            f->alone = alone;
-        });
-    };
+    const course_facts idle = facts(false), works = facts(true);
+    course_facts proxy_down = works, without_start = works;
+    proxy_down.proxy_up = false;
+    without_start.slow_start_s = 0;
     // The first step lasts until the group is active.
     EXPECT_EQ(look("before it joins", idle), "20");
     std::string steps;
@@ -649,26 +622,26 @@ TEST(Course, WeightsLimitsAndDrainsFollowTheFacts) {
     for (int i = 0; i < 29; i++)
         EXPECT_EQ(look("without wccpd", idle), "100");
     EXPECT_EQ(look("joined again", works), "100");
-    EXPECT_EQ(look("proxy down", with([](course_facts *f) { f->proxy_up = false; })), "20");
-    EXPECT_EQ(look("without a slow start", with([](course_facts *f) { f->slow_start_s = 0; })), "100");
+    EXPECT_EQ(look("proxy down", proxy_down), "20");
+    EXPECT_EQ(look("without a slow start", without_start), "100");
     EXPECT_EQ(look("and with it again", works), "100");
     // Overload begins above the limit and ends below 90 % of it.
-    EXPECT_EQ(look("limit", has(100)), "100");
-    EXPECT_EQ(look("limit", has(101)), "100 overloaded");
-    EXPECT_EQ(look("limit", has(90)), "100 overloaded");
-    EXPECT_EQ(look("limit", has(89)), "100");
+    EXPECT_EQ(look("limit", facts(true, 100)), "100");
+    EXPECT_EQ(look("limit", facts(true, 101)), "100 overloaded");
+    EXPECT_EQ(look("limit", facts(true, 90)), "100 overloaded");
+    EXPECT_EQ(look("limit", facts(true, 89)), "100");
     // Empty: two counts of 0 after the table has changed, or after 20 s if that is not visible.
-    EXPECT_EQ(look("drain", drains(1, false, false)), "20");
-    EXPECT_EQ(look("drain", drains(0, false, false)), "20");
-    EXPECT_EQ(look("drain", drains(0, false, false)), "20 empty");
-    EXPECT_EQ(look("drain", drains(1, false, false)), "20");
+    EXPECT_EQ(look("drain", facts(false, 1, true)), "20");
+    EXPECT_EQ(look("drain", facts(false, 0, true)), "20");
+    EXPECT_EQ(look("drain", facts(false, 0, true)), "20 empty");
+    EXPECT_EQ(look("drain", facts(false, 1, true)), "20");
     (void)look("cancelled", works);
-    EXPECT_EQ(look("alone", drains(0, true, true)), "20");
-    EXPECT_EQ(look("alone", drains(0, true, true)), "20 empty");
+    EXPECT_EQ(look("alone", facts(true, 0, true, true)), "20");
+    EXPECT_EQ(look("alone", facts(true, 0, true, true)), "20 empty");
     (void)look("cancelled", works);
     for (int i = 0; i <= 20; i++)
-        EXPECT_EQ(look("still has buckets", drains(0, true, false)), "20");
-    EXPECT_EQ(look("long enough", drains(0, true, false)), "20 empty");
+        EXPECT_EQ(look("still has buckets", facts(true, 0, true)), "20");
+    EXPECT_EQ(look("long enough", facts(true, 0, true)), "20 empty");
     // A group that was active before tunneld started has no slow start.
     one = {};
     EXPECT_EQ(look("taken over", works), "100");
