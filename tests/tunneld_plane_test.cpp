@@ -1,31 +1,18 @@
 // The user-space data plane: reading GRE, merging and splitting, and the complete plane between two network
 // namespaces.
 
-#include <arpa/inet.h>
 #include <gtest/gtest.h>
 #include <net/ethernet.h>
-#include <net/if.h>
-#include <netinet/tcp.h>
 #include <netpacket/packet.h>
 #include <poll.h>
 #include <sched.h>
 #include <signal.h>
 #include <sys/mount.h>
 #include <sys/prctl.h>
-#include <sys/socket.h>
-#include <sys/uio.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <cstring>
 #include <ctime>
 #include <fstream>
-#include <functional>
-#include <string>
-#include <thread>
-#include <vector>
 
-#include "peers/tunneld/coalesce.h"
 #include "peers/tunneld/gre.h"
 #include "peers/tunneld/kernel_state.h"
 #include "peers/tunneld/netlink.h"
@@ -34,41 +21,24 @@
 #include "peers/tunneld/user_shortcut.h"
 #include "peers/tunneld/user_tun.h"
 #include "peers/tunneld/wanted_state.h"
+#include "tests/support/packets.h"
+#include "tests/support/test_host.h"
 
 namespace {
-
-using bytes = std::vector<uint8_t>;
 
 template <typename Header>
 Header *at(bytes *packet, size_t offset) {
     return reinterpret_cast<Header *>(packet->data() + offset);
 }
 ip4_wire_header *ip(bytes *packet) {
-    return at<ip4_wire_header>(packet, 0);
+    return ip_of(packet->data());
 }
 tcp_wire_header *tcp(bytes *packet) {
     return at<tcp_wire_header>(packet, sizeof(ip4_wire_header));
 }
 
-// Corrects lengths and checksums of a packet without IP options.
 void mend(bytes *packet) {
-    ip4_wire_header *header = ip(packet);
-    header->total_length = to_be16(static_cast<uint16_t>(packet->size()));
-    header->checksum = {};
-    header->checksum = checksum_finish(checksum_add(0, header, sizeof *header));
-    const size_t length = packet->size() - sizeof *header;
-    be16 *checksum = nullptr;
-    if (header->protocol == PROTOCOL_TCP) {
-        checksum = &tcp(packet)->checksum;
-    } else if (header->protocol == PROTOCOL_UDP) {
-        auto *udp = at<udp_wire_header>(packet, sizeof *header);
-        udp->length = to_be16(static_cast<uint16_t>(length));
-        checksum = &udp->checksum;
-    }
-    if (!checksum)
-        return;
-    *checksum = {};
-    *checksum = checksum_finish(checksum_add(checksum_pseudo(*header, length), header + 1, length));
+    mend_packet(packet->data(), packet->size());
 }
 
 // A packet's id, content and, with the payload's size, sequence number follow from its number.
@@ -227,12 +197,8 @@ struct one_write {
 };
 std::vector<one_write> writes;
 void keep_write(void *, const iovec *parts, size_t count, uint32_t packets) {
-    one_write write = {*static_cast<const virtio_header *>(parts[0].iov_base), {}, packets};
-    for (size_t i = 1; i < count; i++) {
-        const auto *from = static_cast<const uint8_t *>(parts[i].iov_base);
-        write.packet.insert(write.packet.end(), from, from + parts[i].iov_len);
-    }
-    writes.push_back(write);
+    const auto *header = static_cast<const virtio_header *>(parts[0].iov_base);
+    writes.push_back({*header, join_parts(parts, count), packets});
 }
 
 // Packets through the coalescer into `writes`.
@@ -252,10 +218,8 @@ std::vector<bytes> split_writes() {
     for (one_write &write : writes) {
         packet_split split;
         EXPECT_TRUE(split_begin(&split, write.header, write.packet.data(), write.packet.size()));
-        for (split_segment segment; split_next(&split, &segment);) {
-            out.emplace_back(segment.header, segment.header + segment.header_length);
-            out.back().insert(out.back().end(), segment.payload, segment.payload + segment.payload_length);
-        }
+        for (split_segment segment; split_next(&split, &segment);)
+            out.push_back(join_segment(segment));
     }
     return out;
 }
@@ -387,18 +351,10 @@ void shell(const std::string &command) {
     ASSERT_EQ(system(command.c_str()), 0) << command;
 }
 
-sockaddr_in address_of(uint32_t host_order, uint16_t port = 0) {
-    sockaddr_in out = {};
-    out.sin_family = AF_INET;
-    out.sin_addr.s_addr = htonl(host_order);
-    out.sin_port = htons(port);
-    return out;
-}
-
 void send_gre(uint32_t source, const bytes &payload) {
     const int fd = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
-    const sockaddr_in from = address_of(source), to = address_of(APPLIANCE);
-    EXPECT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&from), sizeof from), 0);
+    const sockaddr_in to = address_of(APPLIANCE);
+    EXPECT_EQ(bind_to(fd, source), 0);
     EXPECT_EQ(
         sendto(fd, payload.data(), payload.size(), 0, reinterpret_cast<const sockaddr *>(&to), sizeof to),
         static_cast<ssize_t>(payload.size()));
@@ -439,10 +395,7 @@ int send_partial() {
     mend(&inner);
     at<udp_wire_header>(&inner, 20)->checksum =
         checksum_fold(checksum_pseudo(*ip(&inner), inner.size() - 20));
-    bytes packet(sizeof(ip4_wire_header)), gre = wrap(0, GRE_TYPE_IPV4, inner);
-    *ip(&packet) = {0x45, 0, {}, {}, {}, 64, PROTOCOL_GRE, {}, to_be32(ROUTER), to_be32(APPLIANCE)};
-    packet.insert(packet.end(), gre.begin(), gre.end());
-    mend(&packet);
+    bytes packet = make_ip_packet(PROTOCOL_GRE, ROUTER, APPLIANCE, wrap(0, GRE_TYPE_IPV4, inner));
     ether_header ether = {{2, 0, 0, 0, 0, 1}, {2, 0, 0, 0, 0, 2}, htons(ETHERTYPE_IP)};
     virtio_header header = {VIRTIO_NEEDS_CHECKSUM, 0, 0, 0, sizeof ether + 20 + 4 + 20, 6};
     iovec parts[] = {{&header, sizeof header}, {&ether, sizeof ether}, {packet.data(), packet.size()}};
@@ -486,9 +439,8 @@ int send_for_shortcut() {
 // Echoes everything on one connection.
 int echo_once() {
     const int listener = socket(AF_INET, SOCK_STREAM, 0), on = 1;
-    const sockaddr_in any = address_of(0xc0a80902, 80);
     setsockopt(listener, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
-    if (bind(listener, reinterpret_cast<const sockaddr *>(&any), sizeof any) != 0 || listen(listener, 1) != 0)
+    if (bind_to(listener, 0xc0a80902, 80) != 0 || listen(listener, 1) != 0)
         return 3;
     const int peer = accept(listener, nullptr, nullptr);
     std::vector<char> buffer(1 << 18);
@@ -574,12 +526,11 @@ struct live_plane : testing::Test {
     void SetUp() override {
         ASSERT_EQ(pipe(commands), 0);
         ASSERT_EQ(pipe(answers), 0);
-        child = fork();
-        if (child == 0) {
+        child = start_child([this] {
             close(commands[1]);
             close(answers[0]);
-            _exit(child_main(commands[0], answers[1]));
-        }
+            return child_main(commands[0], answers[1]);
+        });
         close(commands[0]);
         close(answers[1]); // the child's death ends the wait for its answer
         ASSERT_TRUE(answered());
@@ -599,7 +550,7 @@ struct live_plane : testing::Test {
         close(commands[1]);
         close(answers[0]);
         kill(child, SIGKILL);
-        waitpid(child, nullptr, 0);
+        wait_for_child(child);
     }
     void order(char command) { ASSERT_EQ(write(commands[1], &command, 1), 1); }
     bool answered() {
@@ -656,8 +607,7 @@ TEST_F(live_plane, carries_tcp_in_fragments_and_returns_packets) {
     std::ofstream("/proc/sys/net/ipv4/conf/wccp0/send_redirects") << 0;
 
     const int datagrams = socket(AF_INET, SOCK_DGRAM | SOCK_NONBLOCK, 0);
-    const sockaddr_in any = address_of(INADDR_ANY, 80);
-    ASSERT_EQ(bind(datagrams, reinterpret_cast<const sockaddr *>(&any), sizeof any), 0);
+    ASSERT_EQ(bind_to(datagrams, INADDR_ANY, 80), 0);
 
     // A redirected packet that no proxy wants is returned with its redirect header.
     order('h');
