@@ -14,7 +14,7 @@ source "$(dirname "${BASH_SOURCE[0]}")/../lab/cases.sh"
 lab_cases "$@"
 
 flows=$LAB/flows.out # events of the client
-group='' section='' intercept='' last_answers=8
+group=() section='' intercept='' last_answers=8
 
 # --- The network: a1 and a2 share the group; the programs of a3 are not running yet
 
@@ -23,7 +23,7 @@ start_flows() { # METHOD [NAME=VALUE]... : of the group
     lab_router r1 10.0.0.1 -- --redirect c1=51 --forward "$1" --return "$1"
     lab_client c1 r1
     lab_server s1 r1
-    group=${*:2}
+    group=(51 10.0.0.1 "${@:2}")
     [ -z "${LAB_PROTECTION-}" ] || section=$(printf '[/qv/tunneld/protection/config]\ntime = %s\n' "$LAB_PROTECTION")
     intercept=$(lab_intercept 51 ports=80 interval=1 rise=1)
     for n in 1 2 3; do
@@ -40,12 +40,11 @@ start_flows() { # METHOD [NAME=VALUE]... : of the group
     lab_wait 20 ". == $LAB_FLOWS" eval 'grep -c opened "$flows"' || die "not all connections were opened"
     jq -es 'map(.proxy) | unique == ["a1", "a2"]' "$flows" >/dev/null || die "connections do not use both proxies"
 }
-print_configuration() { # NODE [NAME=VALUE]...
-    # shellcheck disable=SC2086
-    printf '%s\n' "$(lab_group 51 10.0.0.1 $group "${@:2}")" "$intercept" "$section"
+print_configuration() { # [NAME=VALUE]...
+    printf '%s\n' "$(lab_group "${group[@]}" "$@")" "$intercept" "$section"
 }
 run_appliance() { # NODE
-    lab_write_config "$1" "$(print_configuration "$1" weight=100)"
+    lab_write_config "$1" "$(print_configuration weight=100)"
     lab_supervise "$1"
 }
 
@@ -60,7 +59,7 @@ event_join() {
     wait_ready 51 a1 a2 a3
 }
 event_weight() {
-    configure a2 "$(print_configuration a2 weight=400)"
+    configure a2 "$(print_configuration weight=400)"
     router_is r1 30 51 "$(share_of 10.0.0.102) > 0.6"
 }
 event_tunneld_killed() {
@@ -101,27 +100,22 @@ event_drain_stop() {
 
 # --- Results
 
-# A connection that breaks by a request from now on is counted for this event.
-record_event() { # EVENT
-    jq -nc --arg event "$1" --arg now "$EPOCHREALTIME" \
-        '{asked: ($now | tonumber), what: "begins", event: $event}' >>"$LAB/events"
-}
 # Prints a JSON object for each event: the connections that were open when it began and those that broke, by proxy.
 print_summary() {
     jq -cs --slurpfile events "$LAB/events" '
+        def count_each: group_by(.) | map({key: .[0], value: length}) | from_entries;
         map(select(.what != "result")) as $all | $events | to_entries[] |
         .value.asked as $from | ($events[.key + 1].asked // 1e12) as $to |
         {event: .value.event,
          open: ($all | map(select(.asked < $from)) | reduce .[] as $one ({}; .[$one.connection | tostring] = $one) |
-            map(select(.what == "opened").proxy) | group_by(.) | map({key: .[0], value: length}) | from_entries)} +
+            map(select(.what == "opened").proxy) | count_each)} +
         ($all | map(select(.asked >= $from and .asked < $to)) |
-            {broken: (map(select(.what == "broken").proxy) | group_by(.) | map({key: .[0], value: length}) | from_entries),
-             why: (map(select(.what == "broken").why) | group_by(.) | map({key: .[0], value: length}) | from_entries),
+            {broken: (map(select(.what == "broken").proxy) | count_each), why: (map(select(.what == "broken").why) | count_each),
              unopened: (map(select(.what == "unopened")) | length)})' "$flows"
 }
-print_table() { # FILE
+print_table() {
     printf '%-16s %6s %8s  %s\n' event open broken of
-    jq -r '[.event, (.open | add // 0), (.broken | add // 0), ([.broken, .why, {unopened: .unopened}] | map(tojson) | join(" "))] | @tsv' "$1" |
+    jq -r '[.event, (.open | add // 0), (.broken | add // 0), ([.broken, .why, {unopened: .unopened}] | map(tojson) | join(" "))] | @tsv' "$LAB/summary" |
         while IFS=$'\t' read -r event open broken of; do printf '%-16s %6d %8d  %s\n' "$event" "$open" "$broken" "$of"; done
     tail -n 1 "$flows"
 }
@@ -130,7 +124,8 @@ run_events() { # EVENT...
     # shellcheck disable=SC2086
     [ -z "${LAB_EVENTS-}" ] || set -- $LAB_EVENTS
     for event; do
-        record_event "$event"
+        # A connection that breaks by a request from now on is counted for this event.
+        echo "{\"asked\": $EPOCHREALTIME, \"event\": \"$event\"}" >>"$LAB/events"
         "event_$event"
         sleep 3
         lab_alive c1 client || die "the client has exited"
@@ -138,30 +133,24 @@ run_events() { # EVENT...
     kill -TERM $client
     wait $client
     print_summary >"$LAB/summary"
-    print_table "$LAB/summary"
-}
-# No connection broke, except all those of the killed proxy.
-check_broken() {
+    print_table
+    # No connection broke, except all those of the killed proxy.
     [ -n "${LAB_PROTECTION-}" ] || jq -es 'all(.[]; .unopened == 0 and
         .broken == (if .event == "proxy_killed" then .open | {a2} else {} end))' "$LAB/summary" >/dev/null || die "connections broke"
 }
 
 # --- Cases
 
-all_events='join weight tunneld_killed wccpd_killed proxy_killed drain_stop'
+all_events=(join weight tunneld_killed wccpd_killed proxy_killed drain_stop)
 case_gre_hash() {
     LAB_PLANE=user
     start_flows gre hash_src_port=true
-    # shellcheck disable=SC2086
-    run_events $all_events
-    check_broken
+    run_events "${all_events[@]}"
 }
 case_l2_mask() {
     LAB_PLANE=''
     start_flows l2 assign_method=mask mask_src_ip=0x1f mask_dst_ip=0 mask_src_port=0x1
-    # shellcheck disable=SC2086
-    run_events $all_events
-    check_broken
+    run_events "${all_events[@]}"
 }
 # Connections do break without protection.
 case_unprotected() {

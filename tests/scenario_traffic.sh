@@ -16,9 +16,19 @@ start_traffic() { # OPTIONS OF wccp_router...
     lab_client c1 r1
     lab_server s1 r1
 }
+# One appliance, which gets redirected packets and returns them by these methods.
+start_one() { # FORWARD RETURN INTERCEPT_VALUES [OPTIONS OF wccp_router]...
+    start_traffic --forward "$1" --return "$2" "${@:4}"
+    # shellcheck disable=SC2086
+    start_proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 $3)"
+    wait_ready 51 a1
+}
 tunnel_show_has() { # NODE LINE
     lab_in "$1" "$WCCP_BIN/mgmtctl" tunnel show >"$LAB/shown"
     grep -q "$2" "$LAB/shown" || die "tunnel show has no line \"$2\": $(cat "$LAB/shown")"
+}
+is_configured() { # NAME VALUE : in group 51 of a1
+    [ "$(lab_manage a1 get "/qv/wccpd/wccp/srv_grp/config/51/$1" | jq -r '[.. | .value? // empty][0]')" = "$2" ] || die "the configuration changed"
 }
 fetches() { # JQ [OPTIONS OF lab_fetch]
     local out
@@ -79,26 +89,20 @@ case_gre_formats() {
 # L2 and a mask, and the values of `rest` for other ports.
 case_l2_mask() {
     start_traffic --forward l2 --return l2
-    local group="assign_method=mask mask_src_ip=0x3f mask_dst_ip=0"
-    # shellcheck disable=SC2086
-    start_proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1 weight=50 $group)" "$(lab_intercept 51 ports=80)"
-    # shellcheck disable=SC2086
-    start_proxied a2 10.0.0.102 '' "$(lab_group 51 10.0.0.1 weight=100 $group)" "$(lab_intercept 51 ports=80)"
+    local group=(10.0.0.1 assign_method=mask mask_src_ip=0x3f mask_dst_ip=0)
+    start_proxied a1 10.0.0.101 '' "$(lab_group 51 "${group[@]}" weight=50)" "$(lab_intercept 51 ports=80)"
+    start_proxied a2 10.0.0.102 '' "$(lab_group 51 "${group[@]}" weight=100)" "$(lab_intercept 51 ports=80)"
     wait_ready 51 a1 a2
     fetches '.failed == 0 and (.proxies | .a1 == 21 and .a2 == 43)' --count 64 --sources 64
     fetches "$direct" --count 64 --sources 64 --port 8080
     fetches '.failed == 0' --upload 5000000
-    # shellcheck disable=SC2086
-    configure a1 "$(lab_group 51 10.0.0.1 weight=50 $group)" "$(lab_intercept 51 ports=80 rest=drop)"
-    # shellcheck disable=SC2086
-    configure a2 "$(lab_group 51 10.0.0.1 weight=100 $group)" "$(lab_intercept 51 ports=80 rest=forward)"
+    configure a1 "$(lab_group 51 "${group[@]}" weight=50)" "$(lab_intercept 51 ports=80 rest=drop)"
+    configure a2 "$(lab_group 51 "${group[@]}" weight=100)" "$(lab_intercept 51 ports=80 rest=forward)"
     fetches_within 5 '.fetched == 43 and .failed == 21' --count 64 --sources 64 --parallel 64 --port 8080
     finish a1 a2
 }
 case_l2_returned_by_gre() {
-    start_traffic --forward l2 --return gre
-    start_proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
-    wait_ready 51 a1
+    start_one l2 gre ports=80
     fetches "$(by a1)" --count 8 --sources 8
     fetches "$direct" --count 8 --sources 8 --port 8080
     traffic_is 5 '.appliances["10.0.0.101"].returned > 8'
@@ -108,11 +112,8 @@ case_l2_returned_by_gre() {
 # While the proxy is down, its flows go to the server, or are dropped. After a while the group leaves its routers, and
 # comes back when the proxy does.
 case_proxy_down() {
-    start_traffic --forward gre --return gre
-    local quick='ports=80 interval=1 fall=2 rise=1'
-    # shellcheck disable=SC2086
-    start_proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 "${quick%% *}" ${quick#* } leave_after=20)"
-    wait_ready 51 a1
+    local quick=(ports=80 interval=1 fall=2 rise=1)
+    start_one gre gre "${quick[*]} leave_after=20"
     fetches "$(by a1)" --count 4
     lab_stop a1 proxy KILL
     fetches "$direct" --count 8
@@ -121,10 +122,9 @@ case_proxy_down() {
     router_is r1 30 51 '$g.appliances == []'
     tunneld_is a1 5 intercept '.["51"].left'
     explains a1 5 51 left 'connection refused'
-    [ "$(lab_manage a1 get /qv/wccpd/wccp/srv_grp/config/51/admin | jq -r '[.. | .value? // empty][0]')" = up ] || die "the configuration changed"
+    is_configured admin up
     fetches "$direct" --count 8
-    # shellcheck disable=SC2086
-    configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 "${quick%% *}" ${quick#* } leave_after=0)"
+    configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 "${quick[@]}" leave_after=0)"
     router_is r1 30 51 '$g.appliances != []'
     tunneld_is a1 5 intercept '.["51"].left | not'
     explains a1 5 51 proxy-down 'connection refused'
@@ -132,8 +132,7 @@ case_proxy_down() {
     lab_proxy a1
     wait_ready 51 a1
     fetches_within 5 "$(by a1)" --count 4
-    # shellcheck disable=SC2086
-    configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 ${quick#* } leave_after=0 down=drop)"
+    configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 "${quick[@]}" leave_after=0 down=drop)"
     lab_stop a1 proxy KILL
     tunneld_is a1 10 intercept '.["51"].proxy == "down"'
     fetches '.fetched == 0 and .failures == {"connect timeout": 4}' --count 4 --parallel 4 --timeout 1
@@ -145,17 +144,15 @@ case_proxy_down() {
 # New connections go to the server while established ones continue: with a limit, during a drain, and while wccpd is
 # killed and started again. The weight grows in steps, and the link is removed last.
 case_leaving() {
-    start_traffic --forward gre --return gre
     local long drain
-    start_proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 slow_start=12)"
-    wait_ready 51 a1
+    start_one gre gre 'ports=80 slow_start=12'
     lab_wait_event 20 a1 'announces 100 % of its weight' || die "no end of the slow start"
     [ "$(lab_events a1 | grep -o 'announces [0-9]*' | tr -dc '0-9\n' | xargs)" = '20 40 60 80 100' ] || die "$(lab_events a1)"
     begin_long
     configure a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80 limit=7)"
     tunneld_is a1 5 intercept '.["51"].overloaded'
     explains a1 5 51 overload '8 flows'
-    lab_manage a1 alarms | jq -e 'length == 1 and .[0].name == "overload"' >/dev/null || die "$(lab_manage a1 alarms)"
+    [ "$(lab_manage a1 alarms | jq -c 'map(.name)')" = '["overload"]' ] || die "$(lab_manage a1 alarms)"
     fetches "$direct" --count 4
     tunneld_is a1 5 intercept '.["51"].overload >= 4'
     end_long
@@ -175,7 +172,7 @@ case_leaving() {
     wait $drain || die "drain: $(cat "$LAB/drained")"
     router_is r1 10 51 '$g.appliances == []'
     fetches "$direct" --count 4
-    [ "$(lab_manage a1 get /qv/wccpd/wccp/srv_grp/config/51/weight | jq -r '[.. | .value? // empty][0]')" = 100 ] || die "the configuration changed"
+    is_configured weight 100
     lab_manage a1 drain cancel >/dev/null || die "the drain was not cancelled"
     wait_ready 51 a1
     fetches "$(by a1)" --count 4
@@ -254,9 +251,7 @@ case_spoofed() {
 # The router sends from the address of another interface: the packets are refused, and counted by that address, until
 # `tunnel accept`.
 case_accept() {
-    start_traffic --forward gre --return gre --gre-source 10.1.0.1
-    start_proxied a1 10.0.0.101 '' "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
-    wait_ready 51 a1
+    start_one gre gre ports=80 --gre-source 10.1.0.1
     fetches '.fetched == 0' --timeout 1
     tunneld_is a1 10 plane '.refused_source["10.1.0.1"] >= 1'
     tunnel_show_has a1 'refused source 10\.1\.0\.1: mgmtctl tunnel accept 10\.1\.0\.1'
@@ -305,20 +300,18 @@ case_kills() {
     lab_proxy a1
     lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
     lab_supervise a1
-    wait_role a1 60 51 ACTIVE
     wait_ready 51 a1
     local wccpd i transfers results=$LAB/transfers
     wccpd=$(lab_in a1 pgrep -x wccpd)
     for ((i = 1; i <= ${LAB_KILLS-5}; i++)); do
         lab_fetch c1 --parallel 4 --count 4 --size 30000000 --timeout 15 >>"$results" &
-        transfers=$!
+        transfers=($!)
         lab_fetch c1 --parallel 4 --count 4 --upload 30000000 --timeout 15 --port 8080 >>"$results" &
-        transfers+=" $!"
+        transfers+=($!)
         sleep "0.$((RANDOM % 90 + 10))"
         lab_in a1 pkill -KILL -x tunneld || die "cannot kill tunneld"
         fetches_within 3 "$(by a1)"
-        # shellcheck disable=SC2086
-        wait $transfers
+        wait "${transfers[@]}"
     done
     jq -se 'length > 0 and all(.[]; .failures | keys - ["reset", "closed"] == [])' "$results" >/dev/null || die "transfers: $(cat "$results")"
     [ "$(lab_in a1 pgrep -x wccpd)" = "$wccpd" ] || die "wccpd was restarted"
@@ -329,7 +322,6 @@ case_kills() {
     lab_in a1 pkill -KILL -x 'mgmtd|tunneld|wccpd'
     lab_wait_exit 5 a1 mgmtd
     lab_supervise a1
-    wait_role a1 60 51 ACTIVE
     wait_ready 51 a1
     fetches "$(by a1)" --count 4
     lab_stop a1 mgmtd || die "mgmtd exited with $?"
