@@ -2,19 +2,14 @@
 // mgmtd here, and with it in the scenarios.
 
 #include <gtest/gtest.h>
-#include <net/if.h>
 #include <sched.h>
 #include <signal.h>
 #include <sys/prctl.h>
 #include <sys/shm.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <map>
-#include <string>
 #include <thread>
 
 #include "peers/tunneld/kernel_state.h"
@@ -24,6 +19,7 @@
 #include "platform/tunnel_mailbox.h"
 #include "runtime/cmem.h"
 #include "runtime/ttime.h"
+#include "tests/support/test_host.h"
 
 using namespace std::chrono_literals;
 
@@ -43,6 +39,17 @@ void give(uint16_t code, uint16_t id, uint32_t remote) {
 bool take_one(command_desk *desk) {
     bool end = false;
     return take_command(desk, &end);
+}
+// Takes a command that wccpd replaces by another one, or withdraws, while it is executed.
+void take_replaced(command_desk *desk, uint16_t id, uint16_t code) {
+    std::thread wccpd([=] {
+        std::this_thread::sleep_for(20ms);
+        mailbox->command = 0;
+        __atomic_store_n(&mailbox->tunnel_id, id, __ATOMIC_RELEASE);
+        mailbox->command = code;
+    });
+    EXPECT_TRUE(take_one(desk));
+    wccpd.join();
 }
 
 void write_mem_conf() {
@@ -91,20 +98,17 @@ command_desk Tunneld::before_wccpd;
 // Has to be the first test: the mailbox is not attached yet. The child has its own shared memory.
 TEST(Mailbox, ABlockThatIsTooShortIsNotUsed) {
     write_mem_conf();
-    const pid_t child = fork();
-    if (child == 0) {
+    const pid_t child = start_child([] {
         if (unshare(CLONE_NEWIPC) != 0 || !cmem_create_block(4096, WCCP_MAILBOX_NAME))
-            _exit(2);
+            return 2;
         const bool refused = !wccp_attach_mailbox() && wccp_get_tunnel_command() == 0 && !wccp_mailbox &&
                              wccp_get_role(65535) == 2;
         const int key = shmget(0x51520001, 0, 0);
         shmid_ds segment;
         const bool let_go = shmctl(key, IPC_STAT, &segment) == 0 && segment.shm_nattch == 1;
-        _exit(refused && let_go ? 0 : 1);
-    }
-    int status = -1;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    EXPECT_EQ(status, 0);
+        return refused && let_go ? 0 : 1;
+    });
+    EXPECT_EQ(wait_for_child(child), 0);
 }
 
 TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
@@ -164,24 +168,16 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
 TEST_F(Tunneld, ACommandThatWasGivenUpGetsNoAnswer) {
     start_commands(&desk, {.slow_ms = 60}, out);
     static const struct {
-        uint16_t code;
-        uint16_t id;
+        uint16_t code, id;
         bool answered;
-    } replacements[] = {{0, 0, false},
+    } replacements[] = {{0, 310, false},
                         {MAILBOX_ADD_TUNNEL, 311, false},
                         {MAILBOX_DELETE_TUNNEL, 310, false},
                         {MAILBOX_ADD_TUNNEL, 310, true}};
     for (const auto &row : replacements) {
         give(MAILBOX_ADD_TUNNEL, 310, 0x0A000002);
         mailbox->status = 77;
-        std::thread wccpd([&row] {
-            std::this_thread::sleep_for(20ms);
-            mailbox->command = 0;
-            __atomic_store_n(&mailbox->tunnel_id, row.id ? row.id : uint16_t{310}, __ATOMIC_RELEASE);
-            mailbox->command = row.code;
-        });
-        EXPECT_TRUE(take_one(&desk));
-        wccpd.join();
+        take_replaced(&desk, row.id, row.code);
         EXPECT_EQ(mailbox->status, row.answered ? 0u : 77u) << row.code << " " << row.id;
         EXPECT_EQ(desk.tunnels.size(), row.answered ? 1u : 0u);
         EXPECT_EQ(mailbox->command, row.answered ? 0 : row.code);
@@ -207,12 +203,7 @@ TEST_F(Tunneld, AppliesEachChangeOfTheTable) {
     EXPECT_EQ(mailbox->fmst_index, WCCP_NO_INDEX);
     EXPECT_EQ(made.size(), 1u);
     give(MAILBOX_ADD_TUNNEL, 312, 0x0A000003);
-    std::thread wccpd([] {
-        std::this_thread::sleep_for(20ms);
-        mailbox->command = 0;
-    });
-    EXPECT_TRUE(take_one(&desk));
-    wccpd.join();
+    take_replaced(&desk, 312, 0);
     EXPECT_EQ(made.size(), 1u) << "the add that was withdrawn is undone";
     give(MAILBOX_DELETE_TUNNEL, 310, 0x0A000002);
     EXPECT_TRUE(take_one(&desk));
@@ -247,23 +238,16 @@ TEST_F(Tunneld, OnlyTunnelsOfAnOlderWccpdHaveToBeOrderedAgain) {
 
 namespace {
 
-pid_t start_process(const std::function<int()> &body) {
-    const pid_t child = fork();
-    if (child == 0) {
-        prctl(PR_SET_PDEATHSIG, SIGKILL);
-        _exit(freopen("/dev/null", "w", stdout) ? body() : 1);
-    }
-    return child;
-}
 int end_process(pid_t child, int signal) {
-    int status = -1;
     kill(child, signal);
-    waitpid(child, &status, 0);
-    return status;
+    return wait_for_child(child);
 }
 pid_t start_tunneld(int unshared_fd = -1) {
-    return start_process(
-        [unshared_fd] { return close(unshared_fd), run_tunneld({.commands = {}, .plane = "user"}); });
+    return start_child([unshared_fd] {
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        close(unshared_fd);
+        return freopen("/dev/null", "w", stdout) ? run_tunneld({.commands = {}, .plane = "user"}) : 1;
+    });
 }
 
 // Leaves the state of a killed tunneld: a tunnel, an accepted source, and a group with an intercept.
@@ -304,7 +288,7 @@ uint32_t order(uint16_t code, uint16_t id, uint32_t remote) {
 
 TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     ASSERT_EQ(system("ip address add 10.0.0.1/24 dev lo"), 0);
-    ASSERT_EQ(end_process(start_process(leave_a_tunnel), 0), 0);
+    ASSERT_EQ(wait_for_child(start_child(leave_a_tunnel)), 0);
     const std::string maps = sorting_maps();
     const unsigned tunnel = if_nametoindex("wccp0"), beside = if_nametoindex("wccp1");
     ASSERT_TRUE(tunnel && beside && maps.find("goto") != std::string::npos) << maps;
@@ -312,9 +296,8 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     pid_t daemon = start_tunneld();
     const uint32_t added = order(MAILBOX_ADD_TUNNEL, 4, 0x0A000004);
     EXPECT_EQ(added, if_nametoindex("wccp2"));
-    EXPECT_EQ(system("ip rule | grep -q 'iif wccp2 lookup 204803' && ip route show table 204803 | "
-                     "grep -q 'default dev wccp2'"),
-              0);
+    EXPECT_EQ(system("ip rule | grep -q 'iif wccp2 lookup 204803'"), 0);
+    EXPECT_EQ(system("ip route show table 204803 | grep -q 'default dev wccp2'"), 0);
     order(MAILBOX_DELETE_TUNNEL, 4, 0x0A000004);
     EXPECT_FALSE(if_nametoindex("wccp2"));
     EXPECT_EQ(if_nametoindex("wccp0"), tunnel);
