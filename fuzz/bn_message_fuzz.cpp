@@ -4,13 +4,12 @@
 // at most eight times its size in memory, have attributes with valid ids only, and be the same after it is
 // written and read again. It is then passed to all users of messages: readers that copy and that take over,
 // the dump, the answer to a monitoring query, the change event and the walk by pattern.
-#include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <string>
 
 #include <sanitizer/allocator_interface.h>
 
+#include "fuzz/require.h"
 #include "mgmt/bnode_proto.h"
 #include "mgmt/mdc_main.h"
 #include "mgmt/owners.h"
@@ -25,38 +24,6 @@ enum mode : uint8_t {
 };
 constexpr size_t MEMORY_PER_BYTE = 8, MEMORY_PER_MESSAGE = 1024;
 
-void require_true(bool condition, const char *what) {
-    if (condition)
-        return;
-    fprintf(stderr, "not true: %s\n", what);
-    abort();
-}
-#define REQUIRE(condition) require_true((condition), #condition)
-
-lc_status read_wire(const tbuffer *buffer, uint32_t offset, bn_request_msg **out) {
-    return bn_request_msg_deserialize(buffer, offset, out);
-}
-lc_status read_wire(const tbuffer *buffer, uint32_t offset, bn_response_msg **out) {
-    return bn_response_msg_deserialize(buffer, offset, out);
-}
-lc_status write_wire(bn_request_msg *msg, tbuffer **out) {
-    return bn_request_msg_serialize(msg, 0, out);
-}
-lc_status write_wire(bn_response_msg *msg, tbuffer **out) {
-    return bn_response_msg_serialize(msg, 0, out);
-}
-uint32_t count_of(const bn_request_msg *msg) {
-    return bn_request_per_node_array_length_quick(msg->nodes);
-}
-uint32_t count_of(const bn_response_msg *msg) {
-    return bn_response_per_node_array_length_quick(msg->nodes);
-}
-const bn_request_node *node_of(const bn_request_msg *msg, uint32_t index) {
-    return bn_request_per_node_array_get_quick(msg->nodes, index);
-}
-const bn_response_node *node_of(const bn_response_msg *msg, uint32_t index) {
-    return bn_response_per_node_array_get_quick(msg->nodes, index);
-}
 std::string text_of(const tstring *text) {
     return text ? std::string(text->buffer, static_cast<size_t>(text->length)) : std::string();
 }
@@ -103,19 +70,21 @@ void check_same(const bn_binding *a, const bn_binding *b) {
 }
 
 // Reads the message, writes it and reads it again.
-template <typename Message, typename Owner>
+template <auto Read, auto Write, auto CountNodes, auto GetNode, typename Owner>
 bool read_message(const tbuffer *buffer, uint32_t offset, Owner *out) {
     const size_t before = __sanitizer_get_current_allocated_bytes();
-    const lc_status status = read_wire(buffer, offset, &out->pointer);
+    const lc_status status = Read(buffer, offset, &out->pointer);
     const size_t taken = __sanitizer_get_current_allocated_bytes() - before;
     if (status != LC_OK) {
         REQUIRE(!out->pointer);
         return false;
     }
     REQUIRE(taken <= MEMORY_PER_BYTE * buffer->length + MEMORY_PER_MESSAGE);
-    Message *msg = out->pointer;
+    auto *msg = out->pointer;
+    const auto node_of = [](const auto *of, uint32_t i) { return GetNode(of->nodes, i); };
+    const uint32_t count = CountNodes(msg->nodes);
     bool stable = true; // writing an absolute name whose first part is empty drops that part
-    for (uint32_t i = 0; i < count_of(msg); i++) {
+    for (uint32_t i = 0; i < count; i++) {
         check_binding(node_of(msg, i)->binding);
         stable = stable && strncmp(node_of(msg, i)->binding->name->buffer, "//", 2) != 0;
     }
@@ -124,15 +93,15 @@ bool read_message(const tbuffer *buffer, uint32_t offset, Owner *out) {
 
     owned_tbuffer written, again;
     Owner copy;
-    REQUIRE(write_wire(msg, &written.pointer) == LC_OK);
+    REQUIRE(Write(msg, 0, &written.pointer) == LC_OK);
     REQUIRE(msg->length == written.pointer->length && msg->length <= buffer->length);
-    REQUIRE(read_wire(written.pointer, 0, &copy.pointer) == LC_OK);
-    REQUIRE(write_wire(copy.pointer, &again.pointer) == LC_OK);
+    REQUIRE(Read(written.pointer, 0, &copy.pointer) == LC_OK);
+    REQUIRE(Write(copy.pointer, 0, &again.pointer) == LC_OK);
     REQUIRE(written.pointer->length == again.pointer->length);
     REQUIRE(memcmp(written.pointer->buffer, again.pointer->buffer, again.pointer->length) == 0);
     REQUIRE(msg->msg_type == copy.pointer->msg_type && msg->msg_id == copy.pointer->msg_id);
-    REQUIRE(same_beside_nodes(msg, copy.pointer) && count_of(msg) == count_of(copy.pointer));
-    for (uint32_t i = 0; i < count_of(msg); i++) {
+    REQUIRE(same_beside_nodes(msg, copy.pointer) && count == CountNodes(copy.pointer->nodes));
+    for (uint32_t i = 0; i < count; i++) {
         REQUIRE(node_of(msg, i)->node_id == node_of(copy.pointer, i)->node_id);
         REQUIRE(same_beside_binding(node_of(msg, i), node_of(copy.pointer, i)));
         check_same(node_of(msg, i)->binding, node_of(copy.pointer, i)->binding);
@@ -168,8 +137,11 @@ void use_bindings(bn_binding_array *bindings) {
 
 void use_request(const tbuffer *buffer, uint32_t offset) {
     owned_request msg;
-    if (!read_message<bn_request_msg>(buffer, offset, &msg))
+    if (!read_message<bn_request_msg_deserialize, bn_request_msg_serialize,
+                      bn_request_per_node_array_length_quick, bn_request_per_node_array_get_quick>(
+            buffer, offset, &msg))
         return;
+    const uint32_t count = bn_request_per_node_array_length_quick(msg.pointer->nodes);
     bn_request_msg_dump(nullptr, msg.pointer, LC_LOG_DEBUG, "FUZZ");
     uint16_t type = 0;
     owned_bindings bindings, copies;
@@ -182,8 +154,8 @@ void use_request(const tbuffer *buffer, uint32_t offset) {
     if (bn_request_get(msg.pointer, &type, nullptr, 1, &bindings.pointer, &ids.pointer, &info.pointer) !=
         LC_OK)
         return;
-    REQUIRE(bn_binding_array_length_quick(bindings.pointer) == count_of(msg.pointer));
-    REQUIRE(uint32_array_length_quick(ids.pointer) == count_of(msg.pointer));
+    REQUIRE(bn_binding_array_length_quick(bindings.pointer) == count);
+    REQUIRE(uint32_array_length_quick(ids.pointer) == count);
     if (type == bn_msg_query_request)
         (void)mdc_dispatch_mon_request(nullptr, msg.pointer, get_one, nullptr, list_children, nullptr);
     else
@@ -192,7 +164,9 @@ void use_request(const tbuffer *buffer, uint32_t offset) {
 
 void use_response(const tbuffer *buffer, uint32_t offset) {
     owned_response msg, copy;
-    if (!read_message<bn_response_msg>(buffer, offset, &msg))
+    if (!read_message<bn_response_msg_deserialize, bn_response_msg_serialize,
+                      bn_response_per_node_array_length_quick, bn_response_per_node_array_get_quick>(
+            buffer, offset, &msg))
         return;
     bn_response_msg_dump(nullptr, msg.pointer, LC_LOG_DEBUG, "FUZZ");
     REQUIRE(bn_response_msg_dup(msg.pointer, &copy.pointer) == LC_OK);
@@ -205,7 +179,8 @@ void use_response(const tbuffer *buffer, uint32_t offset) {
                  : bn_response_get(copy.pointer, &code, nullptr, 1, &bindings.pointer, &ids.pointer);
         REQUIRE(status == LC_OK);
         REQUIRE(code == msg.pointer->return_code);
-        REQUIRE(bn_binding_array_length_quick(bindings.pointer) == count_of(msg.pointer));
+        REQUIRE(bn_binding_array_length_quick(bindings.pointer) ==
+                bn_response_per_node_array_length_quick(msg.pointer->nodes));
         use_bindings(bindings.pointer);
     }
 }

@@ -1,26 +1,18 @@
 // Fuzzer for the frame reader of a session. The first byte of an input determines the size of the reads and
 // whether the session is already open; the rest is sent through a socket.
-#include <cstdio>
-#include <cstdlib>
-#include <cstring>
-
-#include <sys/stat.h>
-#include <sys/un.h>
-#include <unistd.h>
-
+#include "fuzz/require.h"
 #include "mgmt/gcl.h"
 #include "mgmt/gcl_records.h"
 #include "runtime/logging.h"
 #include "runtime/tbuffer.h"
+#include "tests/support/gcl_provider.h"
 
 namespace {
 
 gcl *instance;
 fdic *interests;
-int listener = -1;
 int depth;
 gcl_session *session;
-constexpr const char *PROVIDER = "/tmp/gcl-socks/uds-provider-fuzz";
 
 lc_status ignore_changes(const fdic_event_array *, void *) {
     return LC_OK;
@@ -46,39 +38,16 @@ lc_status handle_frame(gcl_session *of, gcl_body_protocol *, tbuffer **inout_fra
 void start_instance() {
     G_daemon_log_level = -1;
     G_log_level = -1; // formats no log lines
-    mkdir(GCL_SOCKET_DIRECTORY, 0777);
-    unlink(PROVIDER);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    snprintf(address.sun_path, sizeof address.sun_path, "%s", PROVIDER);
-    listener = socket(AF_UNIX, SOCK_STREAM, 0);
-    if (bind(listener, reinterpret_cast<sockaddr *>(&address), sizeof address) != 0 ||
-        listen(listener, 8) != 0)
-        abort();
-    if (fdic_init(&interests, ignore_changes, nullptr) != LC_OK ||
-        gcl_init(&instance, nullptr, interests) != LC_OK)
-        abort();
+    REQUIRE(fdic_init(&interests, ignore_changes, nullptr) == LC_OK);
+    REQUIRE(gcl_init(&instance, nullptr, interests) == LC_OK);
     gcl_body_protocol recorder{};
     recorder.protocol = 3;
     recorder.enabled = 1;
     recorder.handlers[0] = {3, 0, handle_frame, nullptr};
-    if (gcl_register_body_protocol(instance, &recorder) != LC_OK)
-        abort();
+    REQUIRE(gcl_register_body_protocol(instance, &recorder) == LC_OK);
 }
 
-void send_greeting(int peer) {
-    gcl_wire_header header{};
-    memcpy(header.ident, GCL_FRAME_IDENT, sizeof header.ident);
-    header.version = to_be32(GCL_FRAME_VERSION);
-    header.total_length = to_be32(sizeof header + sizeof(gcl_wire_greeting));
-    header.header_length = to_be16(sizeof header);
-    header.proto = to_be16(GCL_PROTO_ADMIN);
-    header.mtype = to_be16(GCL_ADMIN_GREETING);
-    gcl_wire_greeting body{};
-    body.version = to_be16(GCL_ADMIN_VERSION);
-    body.uid = body.gid = to_be32(UINT32_MAX);
-    (void)!send(peer, &header, sizeof header, MSG_NOSIGNAL);
-    (void)!send(peer, &body, sizeof body, MSG_NOSIGNAL);
+void read_session() {
     (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_READABLE, session, nullptr);
 }
 
@@ -86,33 +55,32 @@ void send_greeting(int peer) {
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size);
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
+    static gcl_provider provider;
     if (!instance)
         start_instance();
+    if (provider.listener < 0)
+        REQUIRE(provider.listen_as("fuzz"));
     if (size < 1 || size > 60000)
         return 0;
-    if (gcl_session_client_new(instance, "fuzz", nullptr, 0, &session) != LC_OK ||
-        gcl_session_client_connect_by_provider(session, "fuzz", 0) != LC_OK)
-        abort();
-    const int peer = accept(listener, nullptr, nullptr);
-    if (data[0] & 0x80)
-        send_greeting(peer);
+    REQUIRE(gcl_session_client_new(instance, "fuzz", nullptr, 0, &session) == LC_OK);
+    REQUIRE(gcl_session_client_connect_by_provider(session, "fuzz", 0) == LC_OK && provider.accept_client());
+    if (data[0] & 0x80) {
+        (void)provider.put(greeting_bytes(UINT32_MAX, UINT32_MAX));
+        read_session();
+    }
     const size_t step = data[0] % 4 == 0 ? size : data[0] % 128u + 1u;
     for (size_t at = 1; at < size; at += step) {
         const size_t now = size - at < step ? size - at : step;
-        (void)!send(peer, data + at, now, MSG_NOSIGNAL | MSG_DONTWAIT);
-        (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_READABLE, session, nullptr);
+        (void)!send(provider.client, data + at, now, MSG_NOSIGNAL | MSG_DONTWAIT);
+        read_session();
     }
-    close(peer);
-    (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_READABLE, session, nullptr);
-    int32_t state = 0;
-    if (gcl_session_get_state(session, &state, nullptr) != LC_OK || state != GCL_SESSION_CLOSED)
-        abort(); // the end of file must have been noticed
+    provider.close_client();
+    read_session();
+    int32_t state = 0; // the end of file must have been noticed
+    REQUIRE(gcl_session_get_state(session, &state, nullptr) == LC_OK && state == GCL_SESSION_CLOSED);
     (void)gcl_session_free(&session);
     static unsigned runs;
-    if (++runs % 1000 == 0) { // the instance keeps freed records until it is freed itself
-        if (gcl_deinit(&instance) != LC_OK || fdic_deinit(&interests) != LC_OK)
-            abort();
-        close(listener);
-    }
+    if (++runs % 1000 == 0) // the instance keeps freed records until it is freed itself
+        REQUIRE(gcl_deinit(&instance) == LC_OK && fdic_deinit(&interests) == LC_OK);
     return 0;
 }

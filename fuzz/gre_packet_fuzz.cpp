@@ -4,16 +4,14 @@
 // An input is a mode byte, followed by frames or, if its lowest bit is set, by one read from a TUN device. A
 // frame is a 16-bit length and that many bytes of GRE. A length with the highest bit set repeats the last
 // frame as the next segments of its flow. All packets are in memory blocks of exactly their size.
-#include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <map>
 #include <memory>
-#include <vector>
 
-#include "peers/tunneld/coalesce.h"
+#include "fuzz/require.h"
 #include "peers/tunneld/gre.h"
 #include "peers/tunneld/passing.h"
+#include "tests/support/packets.h"
 
 namespace {
 
@@ -24,15 +22,6 @@ enum mode : uint8_t {
     FLUSHED = 8,    // flushes after each fifth frame
 };
 constexpr size_t MAX_FRAMES = 300, MAX_FRAME_BYTES = 100000; // more than fits into one large packet
-using bytes = std::vector<uint8_t>;
-
-void require_true(bool condition, const char *what) {
-    if (condition)
-        return;
-    fprintf(stderr, "not true: %s\n", what);
-    abort();
-}
-#define REQUIRE(condition) require_true((condition), #condition)
 
 struct exact_memory {
     explicit exact_memory(const bytes &content) : length(content.size()), memory(new uint8_t[length]) {
@@ -42,42 +31,6 @@ struct exact_memory {
     size_t length;
     std::unique_ptr<uint8_t[]> memory;
 };
-
-ip4_wire_header *ip_of(uint8_t *packet) {
-    return reinterpret_cast<ip4_wire_header *>(packet);
-}
-
-// The checksum field of TCP or UDP; nullptr if the packet has none.
-be16 *transport_checksum(uint8_t *packet, size_t length) {
-    const size_t header = ip4_header_length(*ip_of(packet));
-    if (to_host(ip_of(packet)->fragment) & IP4_FRAGMENT)
-        return nullptr;
-    if (ip_of(packet)->protocol == PROTOCOL_TCP && length >= header + sizeof(tcp_wire_header))
-        return &reinterpret_cast<tcp_wire_header *>(packet + header)->checksum;
-    if (ip_of(packet)->protocol == PROTOCOL_UDP && length >= header + sizeof(udp_wire_header))
-        return &reinterpret_cast<udp_wire_header *>(packet + header)->checksum;
-    return nullptr;
-}
-
-void mend_packet(uint8_t *packet, size_t length) {
-    if (length < sizeof(ip4_wire_header) || length > IP4_MAX_PACKET)
-        return;
-    const size_t header = ip4_header_length(*ip_of(packet));
-    if (header < sizeof(ip4_wire_header) || header > length)
-        return;
-    ip_of(packet)->total_length = to_be16(static_cast<uint16_t>(length));
-    ip_of(packet)->checksum = {};
-    ip_of(packet)->checksum = checksum_finish(checksum_add(0, packet, header));
-    be16 *const checksum = transport_checksum(packet, length);
-    if (!checksum)
-        return;
-    if (ip_of(packet)->protocol == PROTOCOL_UDP)
-        reinterpret_cast<udp_wire_header *>(packet + header)->length =
-            to_be16(static_cast<uint16_t>(length - header));
-    *checksum = {};
-    *checksum = checksum_finish(
-        checksum_add(checksum_pseudo(*ip_of(packet), length - header), packet + header, length - header));
-}
 
 // The offset of the inner packet after a typical GRE header.
 size_t offset_of_packet(const bytes &gre) {
@@ -135,11 +88,8 @@ void split_and_keep(const virtio_header &header, const bytes &content) {
     exact_memory packet(content);
     packet_split split;
     REQUIRE(split_begin(&split, header, packet.memory.get(), packet.length));
-    for (split_segment segment; split_next(&split, &segment);) {
-        bytes one(segment.header, segment.header + segment.header_length);
-        one.insert(one.end(), segment.payload, segment.payload + segment.payload_length);
-        keep_packet(&packets_out, std::move(one));
-    }
+    for (split_segment segment; split_next(&split, &segment);)
+        keep_packet(&packets_out, join_segment(segment));
 }
 
 void check_write(void *, const iovec *parts, size_t count, uint32_t packets) {
@@ -147,11 +97,7 @@ void check_write(void *, const iovec *parts, size_t count, uint32_t packets) {
     REQUIRE(parts[0].iov_len == sizeof(virtio_header));
     virtio_header header;
     memcpy(&header, parts[0].iov_base, sizeof header);
-    bytes packet;
-    for (size_t i = 1; i < count; i++) {
-        const auto *from = static_cast<const uint8_t *>(parts[i].iov_base);
-        packet.insert(packet.end(), from, from + parts[i].iov_len);
-    }
+    const bytes packet = join_parts(parts, count);
     REQUIRE(packet.size() <= IP4_MAX_PACKET && ip4_is_valid(packet.data(), packet.size()));
     uint32_t segments = 1;
     if (packets > 1)
@@ -159,23 +105,6 @@ void check_write(void *, const iovec *parts, size_t count, uint32_t packets) {
     REQUIRE(segments == packets && (header.gso_type != VIRTIO_NOT_LARGE) == (packets > 1));
     packets_written += packets;
     split_and_keep(header, packet);
-}
-
-bytes add_outer_header(const bytes &gre) {
-    bytes out(sizeof(ip4_wire_header));
-    *ip_of(out.data()) = {0x45,
-                          0,
-                          to_be16(static_cast<uint16_t>(out.size() + gre.size())),
-                          {},
-                          {},
-                          64,
-                          PROTOCOL_GRE,
-                          {},
-                          to_be32(0x0a000001),
-                          to_be32(0x0a000002)};
-    ip_of(out.data())->checksum = checksum_finish(checksum_add(0, out.data(), out.size()));
-    out.insert(out.end(), gre.begin(), gre.end());
-    return out;
 }
 
 // A table by which each service passes packets on to another member.
@@ -246,7 +175,7 @@ void fuzz_frames(uint8_t mode, const uint8_t *data, size_t size) {
                 advance_segment(&gre);
             if (mode & MENDED)
                 mend_frame(&gre);
-            frames.emplace_back(add_outer_header(gre));
+            frames.emplace_back(make_ip_packet(PROTOCOL_GRE, 0x0a000001, 0x0a000002, gre));
             accepted += read_frame(&merger, &frames.back());
             if ((mode & FLUSHED) && frames.size() % 5 == 0)
                 coalesce_flush(&merger);
@@ -273,10 +202,8 @@ void fuzz_tun_read(uint8_t mode, const uint8_t *data, size_t size) {
     size_t payload = 0, segments = 0;
     for (split_segment segment; split_next(&split, &segment); segments++) {
         payload += segment.payload_length;
-        bytes one(segment.header, segment.header + segment.header_length);
-        REQUIRE(one.size() == headers);
-        one.insert(one.end(), segment.payload, segment.payload + segment.payload_length);
-        REQUIRE(one.size() <= packet.length);
+        bytes one = join_segment(segment);
+        REQUIRE(segment.header_length == headers && one.size() <= packet.length);
         if (header.gso_type == VIRTIO_NOT_LARGE)
             continue;
         REQUIRE(ip4_is_valid(one.data(), one.size()) && segment.payload_length <= header.segment_size);

@@ -10,13 +10,12 @@
 // consistent, and after the group is deleted nothing of it may be left.
 
 #include <algorithm>
-#include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <utility>
 
 #include "engine/wccp_pkt_load.h"
 #include "engine/wccp_pkt_mgr.h"
+#include "fuzz/require.h"
 #include "runtime/logging.h"
 #include "tests/support/engine_fixture.h"
 #include "tests/support/reported_group.h"
@@ -33,14 +32,6 @@ enum mode : uint8_t {
 };
 constexpr uint32_t ticks_after[8] = {0, 1, 2, 11, 17, 41, 61, 0};
 constexpr size_t DIGEST_AT = 16;
-
-void require_true(bool condition, const char *what) {
-    if (condition)
-        return;
-    fprintf(stderr, "inconsistent records: %s\n", what);
-    abort();
-}
-#define REQUIRE(condition) require_true((condition), #condition)
 
 template <typename Entry>
 uint32_t list_length(Entry *const *head) {
