@@ -2,6 +2,7 @@
 // loop.
 #include <filesystem>
 #include <fstream>
+#include <list>
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -178,13 +179,13 @@ struct Loop : testing::Test {
     loop_event *ticker = nullptr;
     std::function<void()> on_tick;
 
-    void SetUp() override {
-        ASSERT_EQ(lew_init(&wrapper), LC_OK);
-        ASSERT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
-        ASSERT_EQ(loop_event_new(loop, tick, this, &ticker), LC_OK);
-        ASSERT_EQ(loop_event_set_timer(ticker, 2), LC_OK);
+    Loop() {
+        EXPECT_EQ(lew_init(&wrapper), LC_OK);
+        EXPECT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
+        EXPECT_EQ(loop_event_new(loop, tick, this, &ticker), LC_OK);
+        EXPECT_EQ(loop_event_set_timer(ticker, 2), LC_OK);
     }
-    void TearDown() override {
+    ~Loop() override {
         loop_event_free(&ticker);
         EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
     }
@@ -206,21 +207,17 @@ struct Loop : testing::Test {
 
 // mgmtd on the loop, and a wccpd that answers for one router of each of the groups 31 to 51.
 struct Session : Loop {
-    static constexpr uint32_t WCCPD = 0x10000;
+    static constexpr uint32_t WCCPD = 0x10000, MGMTCTL = WCCPD + 1;
     std::unique_ptr<server> daemon;
     std::unique_ptr<transport> sockets;
-    std::vector<bn_request_msg *> asked; // of wccpd
+    std::list<owned_request> asked; // of wccpd
+    strings found;                  // in the answer to mgmtctl
     std::string said, method = "not-set";
     mgmt_link *link = nullptr;
     configured_view view;
     int readings = 0, owners_heard = 0;
-    std::vector<state_node> states = {{NODE_PLANE_STATE "/name", bn_type_str, "table"},
-                                      {NODE_TUNNEL_STATE "/3/index", bn_type_uint32, "7"},
-                                      {NODE_TUNNEL_STATE "/12/index", bn_type_uint32, "8"},
-                                      {NODE_PROTECTION_STATE "/group/51/slots", bn_type_uint32, "9"}};
 
-    void SetUp() override {
-        Loop::SetUp();
+    Session() {
         on_tick = [this] {
             std::vector<pollfd> none;
             if (sockets)
@@ -232,17 +229,20 @@ struct Session : Loop {
             view = now;
             readings++;
         };
-        callbacks.state = [this] { return states; };
+        callbacks.state = [] {
+            return std::vector<state_node>{{NODE_PLANE_STATE "/name", bn_type_str, "table"},
+                                           {NODE_TUNNEL_STATE "/3/index", bn_type_uint32, "7"},
+                                           {NODE_TUNNEL_STATE "/12/index", bn_type_uint32, "8"},
+                                           {NODE_PROTECTION_STATE "/group/51/slots", bn_type_uint32, "9"}};
+        };
         callbacks.owners = [this](uint8_t group, const std::string &text) {
             owners_heard += group == 51 && text == "hash members 192.0.2.3";
         };
         link = mgmt_link_new(wrapper, callbacks);
-        ASSERT_TRUE(link);
     }
-    void TearDown() override {
+    ~Session() override {
         mgmt_link_free(link);
         stop_mgmtd();
-        Loop::TearDown();
     }
     void start_mgmtd() {
         daemon = std::make_unique<server>();
@@ -255,14 +255,18 @@ struct Session : Loop {
         ASSERT_TRUE(transport_listen(sockets.get(), daemon.get(), &error)) << error;
         const auto send = daemon->send;
         daemon->send = [this, send](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
-            if (peer_id < WCCPD) {
-                send(peer_id, mtype, frame);
-                return;
-            }
+            if (peer_id < WCCPD)
+                return send(peer_id, mtype, frame);
             const owned_tbuffer buffer(frame);
-            bn_request_msg *msg = nullptr;
-            if (mtype == bn_msg_query_request && bn_request_msg_deserialize(frame, 32, &msg) == LC_OK)
-                asked.push_back(msg);
+            if (mtype == bn_msg_query_request) {
+                EXPECT_EQ(bn_request_msg_deserialize(frame, 32, &asked.emplace_back().pointer), LC_OK);
+            } else if (peer_id == MGMTCTL) {
+                owned_response response;
+                EXPECT_EQ(bn_response_msg_deserialize(frame, 32, &response.pointer), LC_OK);
+                for (const event_field &each : fields_of(response.pointer))
+                    found.push_back(each.name + "=" + each.value.text);
+                found.push_back("code " + std::to_string(response.pointer->return_code));
+            }
         };
         server_peer_opened(daemon.get(), WCCPD, "wccpd-1");
         daemon->peers[WCCPD].interests.push_back({EVENT_CONFIG_CHANGE, {}});
@@ -272,13 +276,10 @@ struct Session : Loop {
             transport_close(sockets.get());
         sockets.reset();
         daemon.reset();
-        for (bn_request_msg *msg : asked)
-            (void)bn_request_msg_free(&msg);
         asked.clear();
     }
     void answer_for_wccpd() {
-        for (bn_request_msg *each : std::exchange(asked, {})) {
-            const owned_request msg(each);
+        for (const owned_request &msg : std::exchange(asked, {})) {
             owned_response response;
             owned_tbuffer frame;
             ASSERT_EQ(bn_query_response_msg_create(&response.pointer, msg.pointer->msg_id, 0, nullptr),
@@ -381,28 +382,13 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
 TEST_F(Session, AnswersForItsStateAndReports) {
     start_mgmtd();
     ASSERT_TRUE(wait_until([&] { return readings == 1; })) << said;
-    // A second session of mgmtd, whose answers are read from the frames.
-    std::vector<std::string> found;
-    server_peer_opened(daemon.get(), WCCPD + 1, "mgmtctl-2");
-    const auto send = daemon->send;
-    daemon->send = [&, send](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
-        if (peer_id != WCCPD + 1) {
-            send(peer_id, mtype, frame);
-            return;
-        }
-        const owned_tbuffer buffer(frame);
-        owned_response response;
-        ASSERT_EQ(bn_response_msg_deserialize(frame, 32, &response.pointer), LC_OK);
-        for (const event_field &each : fields_of(response.pointer))
-            found.push_back(each.name + "=" + each.value.text);
-        found.push_back("code " + std::to_string(response.pointer->return_code));
-    };
+    server_peer_opened(daemon.get(), MGMTCTL, "mgmtctl-2");
     const auto ask = [&](const std::string &name, uint32_t subop, uint32_t flags) {
         owned_request msg;
         found.clear();
         (void)bn_query_request_msg_create(&msg.pointer, 0, nullptr);
         (void)bn_query_request_msg_append_str(msg.pointer, subop, flags, name.c_str(), nullptr);
-        server_answer_query(daemon.get(), WCCPD + 1, msg.pointer);
+        server_answer_query(daemon.get(), MGMTCTL, msg.pointer);
         EXPECT_TRUE(wait_until([&] { return !found.empty(); })) << name;
         return found;
     };
@@ -489,18 +475,16 @@ struct Health : Loop {
     std::vector<uint8_t> changed;
     char directory[32] = "/tmp/health-test-XXXXXX";
 
-    void SetUp() override {
-        Loop::SetUp();
-        ASSERT_TRUE(mkdtemp(directory));
+    Health() {
+        EXPECT_TRUE(mkdtemp(directory));
         on_tick = [this] { server.serve(); };
         monitor = health_new(loop, [this](uint8_t group) { changed.push_back(group); });
     }
-    void TearDown() override {
+    ~Health() override {
         health_free(monitor);
         std::filesystem::remove_all(directory);
-        Loop::TearDown();
     }
-    const proxy_health &state(uint8_t group) const { return health_states(monitor).at(group); }
+    const proxy_health &state() const { return health_states(monitor).at(51); }
     void watch(const health_check &check, uint16_t port) const {
         intercept rules;
         rules.to = port;
@@ -512,8 +496,8 @@ struct Health : Loop {
     std::string first_result(const health_check &check, uint16_t port) const {
         health_set_checks(monitor, {});
         watch(check, port);
-        EXPECT_TRUE(wait_until([&] { return state(51).checks == 1; })) << check.argument;
-        return state(51).state == proxy_health::up ? "up" : state(51).reason;
+        EXPECT_TRUE(wait_until([&] { return state().checks == 1; })) << check.argument;
+        return state().state == proxy_health::up ? "up" : state().reason;
     }
     std::string result_of_script(const std::string &content) const {
         std::ofstream(path("check")) << "#!/bin/sh\n" << content << "\n";
@@ -525,20 +509,20 @@ struct Health : Loop {
 
 TEST_F(Health, TheFirstResultSettlesAndLaterOnesHaveToAgree) {
     watch({check_kind::tcp, "", 1, 2, 2}, server.port);
-    EXPECT_EQ(state(51).state, proxy_health::unknown);
+    EXPECT_EQ(state().state, proxy_health::unknown);
     ASSERT_TRUE(wait_until([&] { return changed.size() == 1; }, 500)) << "at once";
-    EXPECT_EQ(state(51).state, proxy_health::up);
+    EXPECT_EQ(state().state, proxy_health::up);
     EXPECT_TRUE(wait_until([&] { return server.resets == 1; })) << "reset, not closed";
     watch({check_kind::tcp, "", 1, 2, 2}, server.port);
-    EXPECT_EQ(state(51).checks, 1u) << "the same check goes on";
+    EXPECT_EQ(state().checks, 1u) << "the same check goes on";
 
     close(server.listener);
-    ASSERT_TRUE(wait_until([&] { return state(51).failures == 1; }));
-    EXPECT_EQ(state(51).state, proxy_health::up);
+    ASSERT_TRUE(wait_until([&] { return state().failures == 1; }));
+    EXPECT_EQ(state().state, proxy_health::up);
     ASSERT_TRUE(wait_until([&] { return changed.size() == 2; }));
-    EXPECT_EQ(state(51).state, proxy_health::down);
-    EXPECT_EQ(state(51).failures, 2u);
-    EXPECT_EQ(state(51).reason, "connection refused");
+    EXPECT_EQ(state().state, proxy_health::down);
+    EXPECT_EQ(state().failures, 2u);
+    EXPECT_EQ(state().reason, "connection refused");
     health_set_checks(monitor, {});
     EXPECT_TRUE(health_states(monitor).empty());
 }
@@ -654,10 +638,9 @@ TEST(Flows, AreCountedOnceForEachGroup) {
         {0x0a010080, 0x0a020002, 50000, 80}, {0x0a020002, 0x0a010081, 8080, 40000},
         {0x0a010082, 0x0a020002, 50000, 80},
     };
-    std::map<uint8_t, intercept> intercepts;
+    std::map<uint8_t, intercept> intercepts = {{3, {}}};
     intercepts[1].ports = {{80, 80}, {8000, 9000}};
     intercepts[2].ports = {{80, 80}};
-    intercepts[3].ports = {};
     intercepts[4].protocol = 17;
     EXPECT_EQ(count_flows(made, intercepts), (std::map<uint8_t, uint32_t>{{1, 3}, {2, 2}, {3, 4}}));
 }

@@ -80,10 +80,8 @@ struct Tunneld : testing::Test {
     // The lines since the last call.
     std::string lines() {
         fflush(out);
-        const std::string all(text, length);
-        const std::string fresh = all.substr(told);
-        told = all.size();
-        return fresh;
+        const size_t from = std::exchange(told, length);
+        return std::string(text + from, length - from);
     }
     static command_desk before_wccpd;
     command_desk desk;
