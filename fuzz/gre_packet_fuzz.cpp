@@ -107,13 +107,12 @@ void check_write(void *, const iovec *parts, size_t count, uint32_t packets) {
     split_and_keep(header, packet);
 }
 
-// A table by which each service passes packets on to another member.
+// A table by which all packets are passed on to another member.
 const passing_lookup &make_passing_lookup() {
     static const passing_lookup *const lookup = [] {
         passing_table table;
         for (uint32_t service = 0; service < 256; service++)
-            table[static_cast<uint8_t>(service)] = {
-                1, service % 2 == 0, {}, std::vector<uint32_t>(256, service + 2)};
+            table[static_cast<uint8_t>(service)] = {1, service % 2 == 0, {}, std::vector<uint32_t>(256, 2)};
         auto *made = new passing_lookup;
         fill_passing_lookup(table, made);
         return made;
@@ -133,13 +132,8 @@ bool read_frame(coalescer *merger, exact_memory *frame) {
         return false;
     REQUIRE(ip4_is_valid(content.packet, content.length));
     uint32_t local = 0;
-    if (const uint32_t member = find_passing_member(make_passing_lookup(), content, &local)) {
-        const auto *tcp = reinterpret_cast<const tcp_wire_header *>(
-            content.packet + ip4_header_length(*ip_of(content.packet)));
-        REQUIRE(content.has_redirect && local == 1 && member == content.redirect.service + 2u);
-        REQUIRE(ip_of(content.packet)->protocol == PROTOCOL_TCP &&
-                (tcp->flags & (TCP_SYN | TCP_ACK | TCP_RST | TCP_FIN)) != TCP_SYN);
-    }
+    if (find_passing_member(make_passing_lookup(), content, &local))
+        REQUIRE(content.has_redirect && local == 1);
     keep_packet(&packets_in, bytes(content.packet, content.packet + content.length));
     coalesce_packet(merger, nullptr, content.packet, content.length);
     return true;
