@@ -572,63 +572,52 @@ TEST_F(Health, EachKindOfCheckHasItsReasons) {
 // --- Courses and flows
 
 TEST(Course, WeightsLimitsAndDrainsFollowTheFacts) {
+    using decisions = std::vector<std::pair<std::string, int>>; // and for how many seconds
     course one;
     int64_t at_s = 0;
-    const auto look = [&](const char *when, course_facts now) {
-        SCOPED_TRACE(std::string(when) + " at " + std::to_string(at_s));
-        now.now_ms = at_s++ * 1000;
-        const course_decision decided = follow_course(&one, now);
-        return std::to_string(decided.weight_percent) + (decided.overloaded ? " overloaded" : "") +
-               (decided.empty ? " empty" : "");
+    const auto look = [&](const std::vector<course_facts> &seconds) {
+        decisions out;
+        for (course_facts now : seconds) {
+            now.now_ms = at_s++ * 1000;
+            const course_decision decided = follow_course(&one, now);
+            const std::string text = std::to_string(decided.weight_percent) +
+                                     (decided.overloaded ? " overloaded" : "") +
+                                     (decided.empty ? " empty" : "");
+            if (out.empty() || out.back().first != text)
+                out.push_back({text, 0});
+            out.back().second++;
+        }
+        return out;
     };
     const auto facts = [](bool active, uint32_t flows = 0, bool draining = false, bool alone = false) {
-        return course_facts{.now_ms = 0,
-                            .draining = draining,
-                            .active = active,
-                            .alone = alone,
-                            .flows = flows,
-                            .slow_start_s = 40,
-                            .limit = 100};
+        return course_facts{0, draining, false, active, alone, true, flows, 40, 100};
     };
-    const course_facts idle = facts(false), works = facts(true);
+    const course_facts idle = facts(false), works = facts(true), alone = facts(true, 0, true, true);
     course_facts proxy_down = works, without_start = works;
     proxy_down.proxy_up = false;
     without_start.slow_start_s = 0;
     // The first step lasts until the group is active.
-    EXPECT_EQ(look("before it joins", idle), "20");
-    std::string steps;
-    for (int i = 0; i <= 41; i++)
-        if (const std::string now = look("slow start", works); !steps.ends_with(now + " "))
-            steps += now + " ";
-    EXPECT_EQ(steps, "20 40 60 80 100 ");
+    EXPECT_EQ(look({idle}), (decisions{{"20", 1}}));
+    EXPECT_EQ(look({42, works}), (decisions{{"20", 10}, {"40", 10}, {"60", 10}, {"80", 10}, {"100", 2}}));
     // There is no slow start for a wccpd that is restarted in time, but there is one after the proxy was
-    // down.
-    for (int i = 0; i < 29; i++)
-        EXPECT_EQ(look("without wccpd", idle), "100");
-    EXPECT_EQ(look("joined again", works), "100");
-    EXPECT_EQ(look("proxy down", proxy_down), "20");
-    EXPECT_EQ(look("without a slow start", without_start), "100");
-    EXPECT_EQ(look("and with it again", works), "100");
+    // down, unless none is configured.
+    EXPECT_EQ(look({29, idle}), (decisions{{"100", 29}}));
+    EXPECT_EQ(look({works, proxy_down, without_start, works}),
+              (decisions{{"100", 1}, {"20", 1}, {"100", 2}}));
     // Overload begins above the limit and ends below 90 % of it.
-    EXPECT_EQ(look("limit", facts(true, 100)), "100");
-    EXPECT_EQ(look("limit", facts(true, 101)), "100 overloaded");
-    EXPECT_EQ(look("limit", facts(true, 90)), "100 overloaded");
-    EXPECT_EQ(look("limit", facts(true, 89)), "100");
+    EXPECT_EQ(look({facts(true, 100), facts(true, 101), facts(true, 90), facts(true, 89)}),
+              (decisions{{"100", 1}, {"100 overloaded", 2}, {"100", 1}}));
     // Empty: two counts of 0 after the table has changed, or after 20 s if that is not visible.
-    EXPECT_EQ(look("drain", facts(false, 1, true)), "20");
-    EXPECT_EQ(look("drain", facts(false, 0, true)), "20");
-    EXPECT_EQ(look("drain", facts(false, 0, true)), "20 empty");
-    EXPECT_EQ(look("drain", facts(false, 1, true)), "20");
-    (void)look("cancelled", works);
-    EXPECT_EQ(look("alone", facts(true, 0, true, true)), "20");
-    EXPECT_EQ(look("alone", facts(true, 0, true, true)), "20 empty");
-    (void)look("cancelled", works);
-    for (int i = 0; i <= 20; i++)
-        EXPECT_EQ(look("still has buckets", facts(true, 0, true)), "20");
-    EXPECT_EQ(look("long enough", facts(true, 0, true)), "20 empty");
+    EXPECT_EQ(
+        look({facts(false, 1, true), facts(false, 0, true), facts(false, 0, true), facts(false, 1, true)}),
+        (decisions{{"20", 2}, {"20 empty", 1}, {"20", 1}}));
+    (void)look({works});
+    EXPECT_EQ(look({2, alone}), (decisions{{"20", 1}, {"20 empty", 1}}));
+    (void)look({works});
+    EXPECT_EQ(look({22, facts(true, 0, true)}), (decisions{{"20", 21}, {"20 empty", 1}}));
     // A group that was active before tunneld started has no slow start.
     one = {};
-    EXPECT_EQ(look("taken over", works), "100");
+    EXPECT_EQ(look({works}), (decisions{{"100", 1}}));
 }
 
 TEST(Flows, AreCountedOnceForEachGroup) {
