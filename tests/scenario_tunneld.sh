@@ -36,11 +36,6 @@ case_absent() {
     lab_tunneld_start a1
     check_tunnel
 }
-case_always_absent() {
-    start_group none
-    check_no_tunnel
-    finish a1 -- 'GRE tunnel L2 return add timed out'
-}
 case_slow() {
     start_group '--slow 400'
     check_tunnel
