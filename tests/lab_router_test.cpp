@@ -35,13 +35,13 @@ const std::string PLAIN = "0000 0004 00000000";
 const std::string SERVICE_51 = "0001 0018 01 33 05 06 00000002 00000000000000000000000000000000";
 
 // Receive id 0: the router is not in the view of the message.
-bytes hello(address id, uint16_t weight, uint32_t receive_id) {
+bytes hello(address id, uint16_t weight, uint32_t receive_id, const std::string &security = PLAIN) {
     const std::string identity =
         "0003 002c" + word(id) + "0000 0000" + zeros(32) + word(weight).substr(4) + "0000";
     const std::string view = receive_id == 0
                                  ? "0005 000c 00000001 00000000 00000000"
                                  : "0005 0014 00000001 00000001 0a000001" + word(receive_id) + "00000000";
-    return message(10, PLAIN + SERVICE_51 + identity + view);
+    return message(10, security + SERVICE_51 + identity + view);
 }
 // Two appliances: 100 buckets for the first, 156 for the second.
 bytes hash_assignment(address key, uint32_t receive_id, uint32_t change_number) {
@@ -124,9 +124,7 @@ TEST(LabRouter, RefusesMalformedMessages) {
 TEST(LabRouter, SignsAndChecks) {
     bench lab;
     lab.self.options.password = "secret";
-    bytes signed_hello =
-        message(10, "0000 0014 00000001" + zeros(16) + SERVICE_51 + "0003 002c 0a000065 0000 0000" +
-                        zeros(32) + "0064 0000 0005 000c 00000001 00000000 00000000");
+    bytes signed_hello = hello(LOW, 100, 0, "0000 0014 00000001" + zeros(16));
     EXPECT_EQ(lab.result_of(LOW, signed_hello), "refused: wrong digest");
     // Computed with md5sum: "secret\0\0" and the message with a digest of zeros.
     const bytes digest = octets("bc76b5520d4b344b2f9ce814b8dbb9f3");

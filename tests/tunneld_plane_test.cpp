@@ -11,7 +11,6 @@
 #include <sys/prctl.h>
 
 #include <ctime>
-#include <fstream>
 
 #include "peers/tunneld/gre.h"
 #include "peers/tunneld/kernel_state.h"
@@ -44,17 +43,10 @@ void mend(bytes *packet) {
 // A packet's id, content and, with the payload's size, sequence number follow from its number.
 bytes make_packet(uint8_t protocol, uint32_t number, size_t payload) {
     const size_t transport = protocol == PROTOCOL_TCP ? 32 : sizeof(udp_wire_header);
-    bytes packet(sizeof(ip4_wire_header) + transport + payload);
-    *ip(&packet) = {0x45,
-                    0,
-                    {},
-                    to_be16(static_cast<uint16_t>(0xfffe + number)),
-                    to_be16(IP4_DONT_FRAGMENT),
-                    60,
-                    protocol,
-                    {},
-                    to_be32(0xc6336401),
-                    to_be32(0xcb007101)};
+    bytes packet =
+        make_ip_packet(protocol, 0xc6336401, 0xcb007101, bytes(transport + payload), IP4_DONT_FRAGMENT);
+    ip(&packet)->id = to_be16(static_cast<uint16_t>(0xfffe + number));
+    ip(&packet)->ttl = 60;
     tcp_wire_header *header = tcp(&packet);
     header->source_port = to_be16(40000);
     header->destination_port = to_be16(80);
@@ -548,10 +540,8 @@ TEST_F(live_plane, delivers_and_returns_packets_of_each_kind) {
     EXPECT_EQ(index, if_nametoindex("wccp0"));
     shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && ip route add 203.0.113.0/24 dev "
           "wccp0");
-    for (const char *path : {"all/rp_filter", "wccp0/rp_filter"})
-        std::ofstream("/proc/sys/net/ipv4/conf/" + std::string(path)) << 0;
-    std::ofstream("/proc/sys/net/ipv4/conf/wccp0/forwarding") << 1;
-    std::ofstream("/proc/sys/net/ipv4/conf/wccp0/send_redirects") << 0;
+    shell("cd /proc/sys/net/ipv4/conf && echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter && "
+          "echo 1 >wccp0/forwarding && echo 0 >wccp0/send_redirects");
 
     const int datagrams = socket(AF_INET, SOCK_DGRAM | SOCK_NONBLOCK, 0);
     ASSERT_EQ(bind_to(datagrams, INADDR_ANY, 80), 0);
