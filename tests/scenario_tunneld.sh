@@ -120,7 +120,9 @@ case_crash() {
     lab_router r1 10.0.0.1 -- --forward gre --return gre
     lab_appliance a1 10.0.0.101
     lab_write_config a1 "$(lab_group 51 10.0.0.1)"
-    lab_supervise a1
+    : >"$LAB/a1-mgmtd.out"
+    lab_clock # for mgmtd and, by inheritance, for the programs that it starts
+    lab_start a1 mgmtd "$(command -v env)" "${LAB_CLOCK[@]:1}" "$WCCP_BIN/mgmtd" --config "$LAB_CONFIG" --supervise --wccpd "$WCCP_BIN/wccpd" --tunneld "$WCCP_BIN/tunneld"
     wait_role a1 60 51 ACTIVE
     lab_mark a1
     local before; before=$(lab_in a1 ip -o link show group 2048)
