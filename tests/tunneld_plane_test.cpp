@@ -599,15 +599,13 @@ TEST_F(live_plane, only_valid_udp_of_a_link_takes_the_shortcut) {
     if (!shortcut_open(&shortcut, &error))
         GTEST_SKIP() << error;
     ASSERT_TRUE(tun_open("wccp0", &tun, &error)) << error;
-    shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up");
-    for (const char *path : {"all/rp_filter", "wccp0/rp_filter"})
-        std::ofstream("/proc/sys/net/ipv4/conf/" + std::string(path)) << 0;
+    shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && cd /proc/sys/net/ipv4/conf && "
+          "echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter");
     shortcut_follow_devices(&shortcut);
     EXPECT_EQ(shortcut.devices.size(), 2u); // va, wccp0
     shortcut_add_link(&shortcut, APPLIANCE, ROUTER, tun.index);
     const int datagrams = socket(AF_INET, SOCK_DGRAM, 0);
-    const sockaddr_in any = address_of(INADDR_ANY, 80);
-    ASSERT_EQ(bind(datagrams, reinterpret_cast<const sockaddr *>(&any), sizeof any), 0);
+    ASSERT_EQ(bind_to(datagrams, INADDR_ANY, 80), 0);
     for (const bool known : {true, false}) {
         order('s');
         ASSERT_TRUE(answered());
