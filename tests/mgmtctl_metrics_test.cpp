@@ -145,7 +145,7 @@ TEST(Nodes, AreInTheDocuments) {
     EXPECT_EQ(documented, wanted);
 
     const std::string configured = text_of_source("docs/mgmtd.md");
-    for (const schema_row &one : schema()) {
+    for (const schema_row &one : schema_rows()) {
         const std::string last = one.parts.parts.back();
         EXPECT_TRUE(last == "*" || std::regex_search(configured, std::regex("/" + last + "[ ,]")))
             << one.pattern;

@@ -234,7 +234,7 @@ static canned_nodes sample() {
 TEST(Names, AreCompletedToTheirNextPart) {
     canned_nodes known = sample();
     const auto check = [&](const std::string &word, const std::string &found) {
-        EXPECT_EQ(joined(completions(std::ref(known), word), " "), found);
+        EXPECT_EQ(joined(complete_node_name(std::ref(known), word), " "), found);
     };
     check("/qv/wccpd/system/state/debug_",
           "/qv/wccpd/system/state/debug_all /qv/wccpd/system/state/debug_global");

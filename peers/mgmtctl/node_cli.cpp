@@ -219,7 +219,7 @@ int ctl_complete(const std::string &word) {
     const ctl_ask ask = [&](ctl_walk walk, const std::string &name, ctl_reply *out) {
         return session && ctl_query(session.get(), walk, name, out, &reason);
     };
-    for (const std::string &candidate : completions(ask, word))
+    for (const std::string &candidate : complete_node_name(ask, word))
         write_output(candidate + "\n");
     return CTL_OK;
 }

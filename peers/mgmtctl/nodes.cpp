@@ -37,8 +37,8 @@ std::string number_of(const std::string &root) {
 const std::vector<node_name> &known_patterns() {
     static const std::vector<node_name> all = [] {
         std::vector<node_name> made;
-        made.reserve(schema().size() + wccpd_state_nodes().size() + tunneld_state_nodes().size());
-        for (const schema_row &row : schema())
+        made.reserve(schema_rows().size() + wccpd_state_nodes().size() + tunneld_state_nodes().size());
+        for (const schema_row &row : schema_rows())
             made.push_back(row.parts);
         for (const auto *states : {&wccpd_state_nodes(), &tunneld_state_nodes()})
             for (const char *pattern : *states)
@@ -160,7 +160,7 @@ std::vector<std::string> value_completions(const std::string &name_text, const s
 }
 } // namespace
 
-std::vector<std::string> completions(const ctl_ask &ask, const std::string &word) {
+std::vector<std::string> complete_node_name(const ctl_ask &ask, const std::string &word) {
     if (const size_t equals = word.find('='); equals != std::string::npos)
         return value_completions(word.substr(0, equals), word.substr(equals + 1));
     size_t slash = word.rfind('/');

@@ -18,7 +18,7 @@ using ctl_ask = std::function<bool(ctl_walk walk, const std::string &name, ctl_r
 std::string hint_for_missing(const ctl_ask &ask, const std::string &name);
 std::string hint_for_unchangeable(const ctl_ask &ask, const std::string &name);
 // The completions of a word that has been begun: node names up to their next part, or NAME=VALUE.
-std::vector<std::string> completions(const ctl_ask &ask, const std::string &word);
+std::vector<std::string> complete_node_name(const ctl_ask &ask, const std::string &word);
 
 // A walk. When its answer is larger than a message, it is asked for again in pieces, each below one of the
 // next parts of the name: group by group in the end. False: no answer.

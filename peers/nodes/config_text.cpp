@@ -102,7 +102,7 @@ bool take_section(parser *state, const std::string &line, std::string *out_reaso
         state->text->lines.emplace(name, state->line);
     }
     bool known = false;
-    for (const schema_row &candidate : schema()) {
+    for (const schema_row &candidate : schema_rows()) {
         node_name above = candidate.parts;
         if (above.parts.size() < name.parts.size())
             continue;

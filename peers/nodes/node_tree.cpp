@@ -53,7 +53,7 @@ void tree_refresh(node_tree *tree) {
         if (row->instance)
             instances.push_back(name);
     }
-    for (const schema_row &row : schema()) {
+    for (const schema_row &row : schema_rows()) {
         if (!row.fallback)
             continue;
         if (!has_wildcard(row.parts)) {

@@ -146,7 +146,7 @@ const std::vector<schema_row> rows = [] {
 
 } // namespace
 
-const std::vector<schema_row> &schema() {
+const std::vector<schema_row> &schema_rows() {
     return rows;
 }
 

@@ -36,7 +36,7 @@ struct schema_row {
     bool recreates = false; // a running group follows a change only when it is deleted and created again
     node_name parts = {};   // of the pattern
 };
-const std::vector<schema_row> &schema();
+const std::vector<schema_row> &schema_rows();
 // Patterns of the state nodes that wccpd and tunneld answer.
 const std::vector<const char *> &wccpd_state_nodes();
 const std::vector<const char *> &tunneld_state_nodes();
