@@ -94,7 +94,8 @@ TEST(SecondWccpd, TouchesNothingOfTheFirst) {
         EXPECT_EQ(log.take(), "");
         uint32_t index = 5;
         EXPECT_EQ(wccp_del_tunnel_encap(1, ONE, TWO, &index), 1);
-        EXPECT_EQ(wccp_cleanup_shmem() + wccp_get_role(300), 0u);
+        EXPECT_EQ(wccp_cleanup_shmem(), 0);
+        EXPECT_EQ(wccp_get_role(300), 0u);
         EXPECT_EQ(wccp_get_tunnel_command(), MAILBOX_L2_RETURN);
         EXPECT_EQ(mailbox_get(wccp_mailbox->l2_value), 7u);
         kill(first, SIGKILL);

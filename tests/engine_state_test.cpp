@@ -234,7 +234,7 @@ TEST_F(StateTest, AMissingRouterRaisesTheAdjacencyAlarm60SecondsAfterTheStart) {
 
 TEST_F(StateTest, ALaterReasonLeavesTheCheckWhereItIs) {
     pass_seconds(20);
-    for (const uint32_t reason : {0u, 1u}) {
+    for (const int reason : {0, 1}) {
         wccp_alarm_schedule_verify_router_connectivity_timer(group, reason);
         EXPECT_EQ(group->router_alarm_timer.countdown, reason ? 60u : 40u);
     }

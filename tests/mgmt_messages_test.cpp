@@ -149,7 +149,7 @@ TEST(messages, response_bytes_and_reading) {
             response_owner from;
             ASSERT_EQ((received ? read_response(response(2, bytes), &from) : bn_response_msg_dup(msg, &from)),
                       0);
-            for (const uint32_t round : {0, 1, 2}) { // by copy, by takeover, and from what is left
+            for (const uint32_t round : {0u, 1u, 2u}) { // by copy, by takeover, and from what is left
                 uint32_t code = 0;
                 string_owner message;
                 bindings_owner bindings;

@@ -311,7 +311,7 @@ TEST(Show, AnAlarmHasTheReasonThatFitsIt) {
 TEST(Show, WhatIsNotKnownIsNotSaid) {
     canned_nodes from = one_group();
     std::erase_if(from.nodes, [](const ctl_binding &node) { return node.name.starts_with(ALARM); });
-    for (const uint32_t code : {LC_IO_CLOSED, LC_IO_TIMED_OUT}) {
+    for (const uint32_t code : {uint32_t{LC_IO_CLOSED}, uint32_t{LC_IO_TIMED_OUT}}) {
         from.wccpd_code = code;
         const snapshot shown = gather(&from);
         EXPECT_TRUE(lacks(screen_of(shown), "no alarm"));

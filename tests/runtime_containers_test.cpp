@@ -36,7 +36,7 @@ TEST(Arrays, WalksAreSteered) {
     log_lines log;
     numbers_owner list;
     ASSERT_EQ(uint32_array_new(&list), LC_OK);
-    for (const uint32_t value : {1, 2, 3})
+    for (const uint32_t value : {1u, 2u, 3u})
         ASSERT_EQ(uint32_array_append(list, value), LC_OK);
     using calls = std::pair<uint32_t, lc_status>; // their number, and the result of the second
     const auto steer = [](uint32_array *, uint32_t, uint32_t value, void *data) {
