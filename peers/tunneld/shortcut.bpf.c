@@ -43,12 +43,16 @@ static __always_inline int is_plain_header(const struct iphdr *ip, __u8 protocol
 #pragma unroll
     for (int i = 0; i < 10; i++)
         sum += words[i];
+    // The byte order does not matter for a comparison with 0xffff, and one fold is enough: ten words carry at
+    // most 9.
     return (__u16)(sum + (sum >> 16)) == 0xffff;
 }
 
 // Whether the packet has `length` bytes after `at`.
 static __always_inline int is_complete(struct __sk_buff *packet, __u32 at, __u32 length) {
     __u8 last;
+    // The packet's own length includes a link-layer header, which not every device has. Loading the last byte
+    // relative to the IP header fails if the packet is too short.
     return length >= sizeof(struct iphdr) &&
            bpf_skb_load_bytes_relative(packet, at + length - 1, &last, 1, BPF_HDR_START_NET) == 0;
 }
@@ -64,6 +68,8 @@ int take_shortcut(struct __sk_buff *packet) {
         return TCX_NEXT;
     if (outer.type != bpf_htons(GRE_TYPE_IPV4) && outer.type != bpf_htons(GRE_TYPE_REDIRECT))
         return TCX_NEXT;
+    // Not every router that uses this type sends a redirect header: the first byte of an IP header has other
+    // bits.
     const int has_redirect =
         outer.type == bpf_htons(GRE_TYPE_REDIRECT) && !(outer.redirect[0] & ~REDIRECT_FLAGS);
     const __u32 before = sizeof outer - (has_redirect ? 0 : sizeof outer.redirect);
@@ -73,10 +79,13 @@ int take_shortcut(struct __sk_buff *packet) {
     const __u32 length = bpf_ntohs(inner.tot_len);
     if (bpf_ntohs(outer.ip.tot_len) < before + length || !is_complete(packet, before, length))
         return TCX_NEXT;
+    // The link-layer header stays before the inner packet. The redirection to an interface without one
+    // removes it.
     const struct shortcut_ends ends = {outer.ip.daddr, outer.ip.saddr};
     struct shortcut_link *link = bpf_map_lookup_elem(&links, &ends);
     if (!link || bpf_skb_adjust_room(packet, -(__s32)before, BPF_ADJ_ROOM_MAC, 0))
         return TCX_NEXT;
+    // From here on the packet cannot be left to the ring any more: its outer headers are gone.
     __sync_fetch_and_add(&link->packets, 1);
     __sync_fetch_and_add(&link->bytes, length);
     if (has_redirect)

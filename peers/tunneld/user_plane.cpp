@@ -134,6 +134,7 @@ uint64_t key_of_ends(uint32_t local, uint32_t remote) {
 
 void write_to_tun(void *target, const iovec *parts, size_t count, uint32_t packets) {
     auto *link = static_cast<user_link *>(target);
+    // A device takes a packet as a whole or fails, for example while its interface is down.
     if (writev(link->tun.fd, parts, static_cast<int>(count)) < 0)
         link->counters.refused[REFUSED_ROOM] += packets;
 }
@@ -146,6 +147,7 @@ void refuse_source(user_state *plane, const gre_outer &outer) {
         return;
     plane->refused[REFUSED_SOURCE]++;
     const auto known = plane->refused_sources.find(outer.remote);
+    // Sources beyond the limit are only part of the total: forged ones must not fill the memory.
     if (known != plane->refused_sources.end())
         known->second++;
     else if (plane->refused_sources.size() < REFUSED_SOURCES_MAX)
@@ -160,6 +162,7 @@ user_link *choose_interface(user_state *plane, user_link *link, const gre_conten
     const uint32_t member = find_passing_member(plane->passing, content, &local);
     if (!member || link->wish.kind == link_kind::member)
         return link;
+    // Without a passing link, the packet is sorted like those of our own slots.
     const auto found = plane->passing_by_ends.find(key_of_ends(local, member));
     return found == plane->passing_by_ends.end() || found->second->gone ? link : found->second;
 }
@@ -169,11 +172,14 @@ user_link *choose_interface(user_state *plane, user_link *link, const gre_conten
 refusal carry_large(user_state *plane, user_link *link, user_link *to, const ring_packet &from,
                     const gre_content &content) {
     virtio_header header = from.header;
+    // The hint counts the outer headers as well. With 0 the kernel works out the length itself.
     header.header_length = 0;
+    // A position before the inner packet wraps around, and large_packet_is_valid() refuses it.
     header.checksum_start = static_cast<uint16_t>(header.checksum_start - (content.packet - from.bytes));
     uint32_t packets;
     if (!large_packet_is_valid(header, content.packet, content.length, &packets))
         return REFUSED_INNER;
+    // The device of an older kernel would refuse the write.
     if (header.gso_type == VIRTIO_LARGE_UDP && !to->tun.takes_large_udp)
         return REFUSED_ROOM;
     link->counters.packets_in += packets;
@@ -190,9 +196,11 @@ refusal carry_payload(user_state *plane, user_link *link, const ring_packet &fro
     const refusal why = read_gre_payload(outer.payload, outer.length, merged, &content);
     if (why != REFUSALS)
         return why;
+    // Also for a packet without a redirect header, which makes the memory forget an older one.
     if (user_plane_settings.redirect_header)
         remember_redirect(&plane->redirects, link->serial, content);
     link->counters.redirect_headers += content.has_redirect;
+    // The packet is counted for the link by which it came, even if it leaves by another one.
     user_link *const to = choose_interface(plane, link, content);
     if (merged)
         return carry_large(plane, link, to, from, content);
@@ -204,6 +212,7 @@ refusal carry_payload(user_state *plane, user_link *link, const ring_packet &fro
 }
 
 void carry_packet(user_state *plane, const ring_packet &packet) {
+    // Nothing is known about the packet, not even its link.
     if (packet.lost) {
         plane->refused[REFUSED_ROOM]++;
         return;
@@ -233,6 +242,7 @@ void carry_packet(user_state *plane, const ring_packet &packet) {
 uint32_t drain_ring(user_state *plane) {
     ring_packet packet;
     uint32_t count = 0;
+    // The limit gives TUN devices and other threads their turn.
     while (count < RING_BATCH && ring_next(&plane->ring, &packet)) {
         count++;
         carry_packet(plane, packet);
@@ -240,6 +250,7 @@ uint32_t drain_ring(user_state *plane) {
             coalesce_flush(&plane->merger);
     }
     coalesce_flush(&plane->merger);
+    // Only after the flush: the merger refers to the frames, which the kernel may then overwrite.
     ring_release(&plane->ring);
     return count;
 }
@@ -258,11 +269,14 @@ void send_batch(out_batch *batch, user_link *link) {
                 link->counters.bytes_out += segment.header_length + segment.payload_length;
             }
         } else if (errno == EAGAIN) {
+            // The send buffer is full: it has no room for the other packets either.
             link->counters.refused[REFUSED_ROOM] += batch->count - sent;
             break;
         } else if (again) {
+            // Reporting an old error has cleared it, and the packet gets a second attempt.
             again = false;
         } else {
+            // This packet itself cannot be sent. The others follow.
             link->counters.refused[REFUSED_ROOM]++;
             sent++;
         }
@@ -279,6 +293,7 @@ void finish_message(out_batch *batch, const gre_wire_redirect *redirect) {
     size_t count = 1;
     if (segment.header_length)
         parts[count++] = {segment.header, segment.header_length};
+    // sendmsg() only reads, although iovec is not const.
     parts[count++] = {const_cast<uint8_t *>(segment.payload), segment.payload_length};
     batch->messages[at] = {};
     batch->messages[at].msg_hdr.msg_iov = parts;
@@ -299,6 +314,7 @@ void return_packet(user_state *plane, user_link *link, const virtio_header &head
     const gre_wire_redirect *redirect = nullptr;
     if (user_plane_settings.redirect_header)
         redirect = recall_redirect(plane->redirects, link->serial, packet, length);
+    // A large packet can have more segments than the batch has places.
     while (split_next(&split, &batch->segments[batch->count])) {
         finish_message(batch, redirect);
         if (batch->count == OUT_BATCH)
@@ -307,6 +323,8 @@ void return_packet(user_state *plane, user_link *link, const virtio_header &head
 }
 
 void leave_interface(user_state *plane, user_link *link) {
+    // epoll would report the dead descriptor for ever. The main thread replaces the link when its next
+    // comparison with the kernel finds that the interface is missing.
     epoll_ctl(plane->epoll, EPOLL_CTL_DEL, link->tun.fd, nullptr);
     link->gone = true;
 }
@@ -316,6 +334,8 @@ uint32_t drain_tun(user_state *plane, user_link *link) {
     out_batch *batch = &plane->out;
     size_t used = 0;
     uint32_t reads = 0;
+    // Packets stay in the buffer until they are sent. Each read needs room for the largest packet, but keeps
+    // only what it has used.
     for (; reads < OUT_BATCH && used + IP4_MAX_PACKET <= RECEIVE_BUFFER; reads++) {
         virtio_header header;
         uint8_t *const packet = batch->received + used;
@@ -324,6 +344,7 @@ uint32_t drain_tun(user_state *plane, user_link *link) {
         if (got < static_cast<ssize_t>(sizeof header)) {
             if (got < 0 && errno == EAGAIN)
                 break;
+            // The interface has been deleted, and the descriptor no longer belongs to a device.
             if (got < 0 && (errno == EBADFD || errno == EIO)) {
                 leave_interface(plane, link);
                 break;
@@ -347,9 +368,11 @@ uint32_t drain_tun(user_state *plane, user_link *link) {
 int wait_for_packets(user_state *plane, uint32_t taken, epoll_event (&events)[EVENTS_MAX]) {
     if (taken < BUSY_PACKETS) {
         pollfd ready[] = {{plane->ring.fd, POLLIN, 0}, {plane->epoll, POLLIN, 0}};
+        // Only the ring has packets, which is the usual case: epoll_wait() is not needed.
         if (poll(ready, std::size(ready), -1) > 0 && !ready[1].revents)
             return 0;
     } else if (taken < RING_BATCH) {
+        // A full batch does not wait: the ring has more, and could overflow.
         nanosleep(&GATHER_TIME, nullptr);
     }
     return epoll_wait(plane->epoll, events, EVENTS_MAX, 0);
@@ -364,6 +387,7 @@ uint32_t serve_event(user_state *plane, const epoll_event &event) {
 
 void carry_packets(user_state *plane) {
     prctl(PR_SET_NAME, "tunneld_plane");
+    // The default of 50 microseconds would be a quarter of GATHER_TIME.
     prctl(PR_SET_TIMERSLACK, 1000);            // nanoseconds
     setpriority(PRIO_PROCESS, 0, THREAD_NICE); // of this thread; it may be refused
     uint32_t taken = 0;
@@ -407,14 +431,17 @@ void close_user_plane() {
     state->stop = true;
     if (state->thread.joinable()) {
         const uint64_t one = 1;
+        // The thread sleeps without a time limit, and sees `stop` only when something wakes it.
         (void)!write(state->wake, &one, sizeof one);
         state->thread.join();
     }
+    // Not before the thread has ended, which uses all of these.
     shortcut_close(&state->shortcut);
     ring_close(&state->ring);
     for (const int fd : {state->epoll, state->wake})
         if (fd >= 0)
             close(fd);
+    // Closes the TUN devices as well. They are persistent, and their interfaces stay for the next tunneld.
     state.reset();
 }
 
@@ -457,9 +484,13 @@ bool open_raw_socket(const link_wish &wish, int *out_fd, std::string *out_error)
     const int fd = socket(AF_INET, SOCK_RAW | SOCK_NONBLOCK | SOCK_CLOEXEC, IPPROTO_GRE);
     if (fd < 0)
         return fail_with_errno(out_error, "raw socket");
+    // From here on the link owns the descriptor, even if one of the next steps fails.
     *out_fd = fd;
+    // A raw socket of this protocol would get a copy of every GRE packet.
     sock_filter refuse_all[] = {BPF_STMT(BPF_RET | BPF_K, 0)};
     const sock_fprog program = {1, refuse_all};
+    // Without IP_HDRINCL the kernel writes the outer header, and without path MTU discovery it fragments
+    // packets that are too large instead of refusing them.
     constexpr int ttl = OUTER_TTL, fragment = IP_PMTUDISC_DONT, buffer = SEND_BUFFER, on = 1;
     sockaddr_in local = {}, remote = {};
     local.sin_family = remote.sin_family = AF_INET;
@@ -488,6 +519,7 @@ owned_link take_link_out(user_state *plane, const std::string &name) {
     owned_link link = std::move(found->second);
     const uint64_t ends = key_of_ends(link->wish.local, link->wish.remote);
     auto &by_ends = link->wish.kind == link_kind::passing ? plane->passing_by_ends : plane->by_ends;
+    // A link of another name may have the same ends by now, and keeps its entry.
     if (const auto same = by_ends.find(ends); same != by_ends.end() && same->second == link.get()) {
         by_ends.erase(same);
         if (link->wish.kind != link_kind::passing)
@@ -502,6 +534,7 @@ owned_link take_link_out(user_state *plane, const std::string &name) {
 bool find_user_link(user_state *plane, const std::string &name, const link_wish &wish, uint32_t *out_index) {
     const guest_guard guard(plane);
     const auto found = plane->links.find(name);
+    // An interface with this name but another index was made by somebody else.
     if (found == plane->links.end() || found->second->wish != wish || found->second->gone ||
         if_nametoindex(name.c_str()) != found->second->tun.index)
         return false;
@@ -526,6 +559,7 @@ bool make_user_link(const std::string &name, const link_wish &wish, uint32_t *ou
     if ((carries && !open_raw_socket(wish, &link->out, out_error)) || !tun_open(name, &link->tun, out_error))
         return false;
     *out_index = link->tun.index;
+    // The device by which the router's packets arrive may be as new as its tunnel.
     shortcut_follow_devices(&plane->shortcut);
     const guest_guard guard(plane);
     if (!watch_descriptor(plane, link->tun.fd, link->serial, out_error))
@@ -548,6 +582,7 @@ void read_user_counters(plane_counters *inout) {
     if (!state)
         return;
     const guest_guard guard(state.get());
+    // The kernel's count begins at 0 again with each reading.
     state->refused[REFUSED_ROOM] += ring_take_losses(&state->ring);
     for (const auto &[name, link] : state->links) {
         link_counters &out = inout->links[name];
@@ -574,6 +609,8 @@ void follow_user_devices() {
 void set_user_passing(const passing_table &table) {
     if (!state)
         return;
+    // Filled before the lock is taken, and the old table is freed after it has been released: both take a
+    // while.
     passing_lookup lookup;
     fill_passing_lookup(table, &lookup);
     const guest_guard guard(state.get());

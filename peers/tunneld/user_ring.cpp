@@ -42,6 +42,8 @@ bool set_option(int fd, int level, int option, const Value &value, const char *w
 
 // Accepts packets to this host with protocol GRE.
 bool set_ring_filter(int fd, std::string *out_error) {
+    // Offsets from SKF_NET_OFF count from the network header: link-layer headers differ in length. The
+    // version needs no check, since the socket is bound to IPv4.
     sock_filter code[] = {
         BPF_STMT(BPF_LD | BPF_B | BPF_ABS, static_cast<uint32_t>(SKF_AD_OFF + SKF_AD_PKTTYPE)),
         BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, PACKET_HOST, 0, 3),
@@ -79,6 +81,7 @@ bool start_ring(const packet_ring *ring, std::string *out_error) {
     any.sll_protocol = htons(ETH_P_IP);
     if (bind(ring->fd, reinterpret_cast<const sockaddr *>(&any), sizeof any) != 0)
         return fail_ring(out_error, "start");
+    // The way of distribution makes no difference to a group of one.
     constexpr unsigned mode = (PACKET_FANOUT_CPU | PACKET_FANOUT_FLAG_DEFRAG | FANOUT_UNIQUE_ID) << 16;
     return set_option(ring->fd, SOL_PACKET, PACKET_FANOUT, mode, "reassembly", out_error);
 }
@@ -88,6 +91,8 @@ bool set_up_ring(packet_ring *ring, std::string *out_error) {
     ring->fd = socket(AF_PACKET, SOCK_RAW | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (ring->fd < 0)
         return fail_ring(out_error, "socket");
+    // The version and the virtio header can only be set before the frames exist. PACKET_COPY_THRESH also puts
+    // a packet that is too large for a frame into the socket's queue.
     constexpr int version = TPACKET_V2, on = 1, queue = LARGE_QUEUE;
     if (!set_ring_filter(ring->fd, out_error) ||
         !set_option(ring->fd, SOL_PACKET, PACKET_VERSION, version, "version", out_error) ||
@@ -107,6 +112,7 @@ tpacket2_hdr *frame_at(const packet_ring *ring, uint32_t number) {
 
 // A packet that does not fit into a frame is in the socket's queue as a whole.
 void fetch_large_packet(packet_ring *ring, size_t link_header, ring_packet *out) {
+    // With MSG_TRUNC the result is the whole length, which shows that a packet did not fit.
     const ssize_t got = recv(ring->fd, ring->large, LARGE_SIZE, MSG_DONTWAIT | MSG_TRUNC);
     const size_t before = sizeof out->header + link_header;
     if (got < 0 || static_cast<size_t>(got) < before || static_cast<size_t>(got) > LARGE_SIZE) {
@@ -139,9 +145,11 @@ void ring_close(packet_ring *ring) {
 }
 
 bool ring_next(packet_ring *ring, ring_packet *out) {
+    // The next frame would be the first of the held ones, whose status says that it is ready.
     if (ring->held == FRAMES)
         return false;
     const tpacket2_hdr *frame = frame_at(ring, ring->next);
+    // The kernel writes the status last. With acquire order, everything else in the frame is there as well.
     const uint32_t status = __atomic_load_n(&frame->tp_status, __ATOMIC_ACQUIRE);
     if (!(status & TP_STATUS_USER))
         return false;
@@ -150,12 +158,16 @@ bool ring_next(packet_ring *ring, ring_packet *out) {
     *out = {};
     const size_t link = frame->tp_mac, network = frame->tp_net, size = frame->tp_snaplen;
     const size_t link_header = network > link ? network - link : 0;
+    // The frame has only the beginning of the packet. The queue has the large packets in the order of the
+    // frames.
     if (status & TP_STATUS_COPY) {
         fetch_large_packet(ring, link_header, out);
     } else if (link < sizeof out->header || network < link || link_header > size ||
                link + size > FRAME_SIZE || frame->tp_len > size) {
         out->lost = true;
     } else {
+        // The frame that was just taken, but writable. The virtio header is directly before the link-layer
+        // header.
         uint8_t *const bytes = reinterpret_cast<uint8_t *>(frame_at(ring, ring->next + FRAMES - 1));
         out->bytes = bytes + network;
         out->length = size - link_header;
@@ -168,6 +180,7 @@ bool ring_next(packet_ring *ring, ring_packet *out) {
 }
 
 void ring_release(packet_ring *ring) {
+    // The oldest first, which is the one that the kernel fills next.
     for (; ring->held > 0; ring->held--)
         __atomic_store_n(&frame_at(ring, ring->next + FRAMES - ring->held)->tp_status, TP_STATUS_KERNEL,
                          __ATOMIC_RELEASE);
@@ -176,6 +189,7 @@ void ring_release(packet_ring *ring) {
 uint32_t ring_take_losses(packet_ring *ring) {
     tpacket_stats stats = {};
     socklen_t length = sizeof stats;
+    // Reading the statistics resets them.
     if (getsockopt(ring->fd, SOL_PACKET, PACKET_STATISTICS, &stats, &length) != 0)
         return 0;
     return stats.tp_drops;

@@ -53,9 +53,12 @@ bool shortcut_open(packet_shortcut *shortcut, std::string *out_why_not) {
         return fail_shortcut(shortcut, "the program cannot be loaded", out_why_not);
     shortcut->program = bpf_program__fd(bpf_object__find_program_by_name(shortcut->object, "take_shortcut"));
     shortcut->links = bpf_object__find_map_fd_by_name(shortcut->object, "links");
+    // A program that loads may still lack its place: TCX is newer than all that the program uses. Each
+    // network namespace has the device lo.
     const int trial = attach_to(*shortcut, if_nametoindex("lo"));
     if (trial < 0)
         return fail_shortcut(shortcut, "the program cannot be attached", out_why_not);
+    // Closing the descriptor detaches the program.
     close(trial);
     return true;
 }
@@ -72,6 +75,7 @@ void shortcut_follow_devices(packet_shortcut *shortcut) {
     if (!shortcut->object || getifaddrs(&addresses) != 0)
         return;
     const std::unique_ptr<ifaddrs, decltype(&freeifaddrs)> owned(addresses, freeifaddrs);
+    // An interface is listed once for each of its addresses.
     std::set<unsigned> found;
     for (const ifaddrs *each = addresses; each; each = each->ifa_next)
         if (each->ifa_addr && each->ifa_addr->sa_family == AF_INET && !(each->ifa_flags & IFF_LOOPBACK))
@@ -79,6 +83,7 @@ void shortcut_follow_devices(packet_shortcut *shortcut) {
     std::erase_if(shortcut->devices, [&](const auto &device) {
         return !found.contains(device.first) && close(device.second) == 0;
     });
+    // An index of 0 belongs to a device that has just been removed. A failure is tried again the next time.
     for (const unsigned device : found)
         if (device && !shortcut->devices.contains(device))
             if (const int attachment = attach_to(*shortcut, device); attachment >= 0)
@@ -91,6 +96,7 @@ void shortcut_add_link(packet_shortcut *shortcut, uint32_t local, uint32_t remot
     const shortcut_ends ends = make_ends(local, remote);
     shortcut_link link = {};
     link.index = index;
+    // The entry replaces an old one of these ends, and its counters begin at 0 like those of the new link.
     bpf_map_update_elem(shortcut->links, &ends, &link, BPF_ANY);
 }
 

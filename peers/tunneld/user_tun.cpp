@@ -45,13 +45,17 @@ bool set_up_device(int fd, const std::string &name, tun_device *out, std::string
     request.ifr_flags = IFF_TUN | IFF_NO_PI | IFF_VNET_HDR;
     if (!attach_device(fd, &request))
         return fail_tun(out_error, "TUN device " + name);
+    // An existing device keeps the size that its last program has set.
     int header = sizeof(virtio_header);
     if (ioctl(fd, TUNSETVNETHDRSZ, &header) != 0)
         return fail_tun(out_error, name + ": virtio header");
     constexpr unsigned offloads = TUN_F_CSUM | TUN_F_TSO4 | TUN_F_TSO_ECN;
+    // The flags say what this program can read. A kernel that knows those for UDP also takes large UDP
+    // packets that are written.
     out->takes_large_udp = ioctl(fd, TUNSETOFFLOAD, offloads | TUN_LARGE_UDP) == 0;
     if (!out->takes_large_udp && ioctl(fd, TUNSETOFFLOAD, offloads) != 0)
         return fail_tun(out_error, name + ": offloads");
+    // Last: a new device that could not be set up vanishes with its descriptor.
     if (ioctl(fd, TUNSETPERSIST, 1) != 0)
         return fail_tun(out_error, name + ": persistence");
     out->index = if_nametoindex(name.c_str());
@@ -74,6 +78,7 @@ bool tun_probe(std::string *out_why_not) {
 
 bool tun_open(const std::string &name, tun_device *out, std::string *out_error) {
     *out = {};
+    // Non-blocking, because the device is read until it is empty.
     const int fd = open(TUN_PATH, O_RDWR | O_NONBLOCK | O_CLOEXEC);
     if (fd < 0)
         return fail_tun(out_error, TUN_PATH);
@@ -100,6 +105,7 @@ bool remove_interface(const std::string &name, std::string *out_error) {
     }
     rtnl_link_put(link);
     nl_socket_free(socket);
+    // Somebody else may have removed it in the meantime.
     if (error == 0 || error == -NLE_NODEV || error == -NLE_OBJ_NOTFOUND)
         return true;
     *out_error = name + ": " + nl_geterror(error);
