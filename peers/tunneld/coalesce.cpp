@@ -27,18 +27,22 @@ bool has_ports(const uint8_t *packet, size_t length) {
 
 // The length of both headers if the packet can be merged with others, otherwise 0.
 size_t find_mergeable_headers(const coalescer *merger, const uint8_t *packet, size_t length) {
+    // Fragments have been sorted out before. The kernel's receive offload does not merge packets with the
+    // reserved bit either.
     if (to_host(ip_of(packet)->fragment) & ~IP4_DONT_FRAGMENT)
         return 0;
     size_t headers = sizeof(ip4_wire_header);
     if (ip_of(packet)->protocol == PROTOCOL_UDP) {
         const udp_wire_header *udp = udp_of(packet);
         headers += sizeof *udp;
+        // A merged packet always has a checksum, which its segments would then get as well.
         const bool has_checksum = to_host(udp->checksum) != 0;
         if (!merger->merge_udp || !has_checksum || to_host(udp->length) != length - sizeof(ip4_wire_header))
             return 0;
     } else {
         const tcp_wire_header *tcp = tcp_of(packet);
         headers += tcp_header_length(*tcp);
+        // Any other flag applies to its own segment and not to the whole of a merged packet.
         if (tcp_header_length(*tcp) < sizeof *tcp || (tcp->flags & ~TCP_PSH) != TCP_ACK)
             return 0;
     }
@@ -58,6 +62,7 @@ size_t find_flow_slot(const void *target, const uint8_t *packet) {
     uint32_t ports;
     memcpy(&ports, packet + sizeof(ip4_wire_header), sizeof ports);
     const uint64_t key = addresses ^ (uint64_t{ports} << 16) ^ reinterpret_cast<uintptr_t>(target);
+    // Multiplicative hashing: the upper bits depend on all bits of the key, and six of them number 64 slots.
     return (key * 0x9e3779b97f4a7c15u) >> 58;
 }
 
@@ -75,6 +80,7 @@ bool same_headers(const coalesced_flow &flow, const uint8_t *packet) {
     if (a->protocol == PROTOCOL_UDP)
         return true;
     const tcp_wire_header *s = tcp_of(flow.first), *t = tcp_of(packet);
+    // With timestamps among the options, only segments of the same tick of the sender's clock are merged.
     return s->acknowledgement == t->acknowledgement && s->data_offset == t->data_offset &&
            s->window == t->window && s->urgent == t->urgent &&
            memcmp(s + 1, t + 1, tcp_header_length(*s) - sizeof *s) == 0;
@@ -85,6 +91,7 @@ bool same_headers(const coalesced_flow &flow, const uint8_t *packet) {
 bool id_follows(const coalesced_flow &flow, const uint8_t *packet) {
     const ip4_wire_header *ip = ip_of(packet);
     const uint16_t from_first = static_cast<uint16_t>(to_host(ip->id) - flow.first_id);
+    // The second packet decides whether the ids of this flow advance by 1 or stay the same.
     if (flow.count == 1)
         return from_first == 1 || (from_first == 0 && (to_host(ip->fragment) & IP4_DONT_FRAGMENT));
     return from_first == static_cast<uint16_t>(flow.id_step * flow.count);
@@ -93,12 +100,14 @@ bool id_follows(const coalesced_flow &flow, const uint8_t *packet) {
 bool can_follow(coalesced_flow *flow, const uint8_t *packet, size_t length, size_t headers) {
     const size_t payload = length - headers;
     const bool tcp = ip_of(packet)->protocol == PROTOCOL_TCP;
+    // One size describes all segments: only the last one may be shorter, and with UDP not even that.
     if (headers != flow->header_length || flow->pushed || flow->count == COALESCED_SEGMENTS ||
         payload > flow->segment_size || (!tcp && payload != flow->segment_size) ||
         headers + flow->payload + payload > IP4_MAX_PACKET || !same_headers(*flow, packet) ||
         (tcp && to_host(tcp_of(packet)->sequence) != flow->next_sequence) || !id_follows(*flow, packet))
         return false;
     // The merged packet gets a new checksum, which would hide that an old one was wrong.
+    // The first packet is checked only now, since alone it would have kept its own checksum.
     if (!flow->verified && !transport_is_right(flow->first, flow->packet_length))
         return false;
     flow->verified = true;
@@ -120,6 +129,7 @@ void write_merged_headers(const coalesced_flow &flow, uint8_t *out) {
     ip->total_length = to_be16(static_cast<uint16_t>(total));
     ip->checksum = {};
     ip->checksum = checksum_finish(checksum_add(0, ip, sizeof *ip));
+    // Only the sum of the pseudo-header. The kernel adds the rest when it splits the packet.
     const be16 partial = checksum_fold(checksum_pseudo(*ip, transport));
     if (ip->protocol == PROTOCOL_UDP) {
         auto *udp = reinterpret_cast<udp_wire_header *>(ip + 1);
@@ -154,6 +164,7 @@ void flush_flow(coalescer *merger, coalesced_flow *flow) {
 
 void append_segment(coalesced_flow *flow, const uint8_t *packet, size_t length) {
     const size_t payload = length - flow->header_length;
+    // begin_flow() appends the first packet, when the count is still 0.
     if (flow->count == 1)
         flow->id_step = static_cast<uint16_t>(to_host(ip_of(packet)->id) - flow->first_id);
     flow->parts[2 + flow->count++] = {const_cast<uint8_t *>(packet) + flow->header_length, payload};
@@ -218,6 +229,7 @@ bool large_packet_is_valid(const virtio_header &header, const uint8_t *packet, s
         (to_host(ip_of(packet)->fragment) & IP4_FRAGMENT) || header.segment_size < MIN_SEGMENT_SIZE ||
         !(header.flags & VIRTIO_NEEDS_CHECKSUM))
         return false;
+    // Unlike packets that are merged here, these may have IP options.
     const size_t ip = ip4_header_length(*ip_of(packet));
     size_t headers = ip;
     uint16_t checksum_at = offsetof(udp_wire_header, checksum);
@@ -236,6 +248,7 @@ bool large_packet_is_valid(const virtio_header &header, const uint8_t *packet, s
     } else {
         return false;
     }
+    // Any other position would have the checksum overwrite something else.
     if (length <= headers || header.checksum_start != ip || header.checksum_offset != checksum_at)
         return false;
     *out_segments = static_cast<uint32_t>((length - headers + header.segment_size - 1) / header.segment_size);
@@ -263,6 +276,7 @@ bool split_begin(packet_split *split, const virtio_header &header, uint8_t *pack
     if (!ip4_is_valid(packet, length))
         return false;
     split->packet = packet;
+    // The IP header decides: padding may follow the packet.
     split->length = to_host(ip_of(packet)->total_length);
     if (header.gso_type == VIRTIO_NOT_LARGE)
         return complete_checksum(header, packet, split->length);
@@ -287,6 +301,7 @@ void write_segment_headers(const packet_split &split, split_segment *out, bool l
     auto *ip = reinterpret_cast<ip4_wire_header *>(out->header);
     const size_t transport = split.header_length - split.ip_length + out->payload_length;
     ip->total_length = to_be16(static_cast<uint16_t>(split.ip_length + transport));
+    // Consecutive ids, as the kernel assigns them when it splits a packet.
     ip->id = to_be16(static_cast<uint16_t>(to_host(ip->id) + split.index));
     ip->checksum = {};
     ip->checksum = checksum_finish(checksum_add(0, ip, split.ip_length));
@@ -299,6 +314,7 @@ void write_segment_headers(const packet_split &split, split_segment *out, bool l
     } else {
         auto *tcp = reinterpret_cast<tcp_wire_header *>(after_ip);
         tcp->sequence = to_be32(to_host(tcp->sequence) + static_cast<uint32_t>(split.at));
+        // Like segmentation by a network card: FIN and PSH belong to the last segment, CWR to the first.
         if (!last)
             tcp->flags &= static_cast<uint8_t>(~(TCP_FIN | TCP_PSH));
         if (split.index > 0)
@@ -322,6 +338,7 @@ bool split_next(packet_split *split, split_segment *out) {
     out->payload = split->packet + split->header_length + split->at;
     out->payload_length = left;
     out->header_length = split->header_length;
+    // Otherwise the whole packet is the payload, and no header is written.
     if (split->segment_size) {
         if (left > split->segment_size)
             out->payload_length = split->segment_size;

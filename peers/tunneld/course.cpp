@@ -19,6 +19,7 @@ bool is_group_empty(course *self, const course_facts &facts) {
     // appliances the table does not change.
     const bool moved =
         facts.left || facts.alone || !facts.active || facts.now_ms - self->draining_ms >= TABLE_CHANGE_MS;
+    // Every flow that is seen in between makes the two counts begin anew.
     if (facts.flows > 0 || !moved)
         self->empty_ms = -1;
     else if (self->empty_ms < 0)
@@ -27,6 +28,7 @@ bool is_group_empty(course *self, const course_facts &facts) {
 }
 
 bool is_overloaded(course *self, const course_facts &facts) {
+    // The overload ends only below 90 % of the limit, so that it does not come and go with single flows.
     const uint64_t flows = facts.flows, limit = facts.limit;
     self->overloaded = limit != 0 && (self->overloaded ? flows * 10 >= limit * 9 : flows > limit);
     return self->overloaded;
@@ -39,9 +41,11 @@ uint32_t find_weight_percent(course *self, const course_facts &facts) {
         self->inactive_ms = -1;
     else if (self->inactive_ms < 0)
         self->inactive_ms = facts.now_ms;
+    // A restart of wccpd is waited for, except at the first call, when nothing is known to have been active.
     const bool lost =
         self->inactive_ms >= 0 && (!self->begun || facts.now_ms - self->inactive_ms >= ROUTER_PATIENCE_MS);
     self->begun = true;
+    // The slow start itself begins once the group is ACTIVE with a proxy that is up.
     if (facts.draining || facts.left || !facts.proxy_up || lost)
         self->cold = true;
     else if (self->cold && facts.active) {
@@ -55,6 +59,8 @@ uint32_t find_weight_percent(course *self, const course_facts &facts) {
     if (whole_ms != 0 && self->cold)
         step = 1;
     else if (self->slow_start_ms >= 0)
+        // The first step has been announced already. The others follow at equal intervals, the last one at
+        // the end.
         step = static_cast<uint32_t>(std::min<int64_t>(
             (facts.now_ms - self->slow_start_ms) * (SLOW_START_STEPS - 1) / whole_ms + 1, SLOW_START_STEPS));
     return step * 100 / SLOW_START_STEPS;

@@ -49,6 +49,7 @@ void add_flow_of_socket(const inet_diag_msg &socket, const std::vector<uint32_t>
         !read_socket_address(socket.idiag_family, socket.id.idiag_dst, &flow.remote) ||
         flow.local >> 24 == 127 || std::binary_search(own.begin(), own.end(), flow.local))
         return;
+    // What is left is transparent: no other socket has a foreign local address.
     flow.local_port = ntohs(socket.id.idiag_sport);
     flow.remote_port = ntohs(socket.id.idiag_dport);
     out->push_back(flow);
@@ -81,6 +82,7 @@ int read_socket_list(int fd, const std::vector<uint32_t> &own, std::vector<flow_
         auto length = static_cast<unsigned>(count);
         for (const auto *message = reinterpret_cast<const nlmsghdr *>(bytes.get()); NLMSG_OK(message, length);
              message = NLMSG_NEXT(message, length)) {
+            // A dump can take several reads, and ends with this message.
             if (message->nlmsg_type == NLMSG_DONE)
                 return 0;
             if (message->nlmsg_type == NLMSG_ERROR)
@@ -127,6 +129,7 @@ std::map<uint8_t, uint32_t> count_flows(const std::vector<flow_ends> &flows,
         if (rules.protocol != IPPROTO_TCP)
             continue;
         std::map<std::pair<uint32_t, uint32_t>, uint32_t> by_addresses[2]; // by the order of the addresses
+        // Both directions of a pair of addresses have the same key, in one map each.
         for (const flow_ends &flow : flows)
             if (has_port(rules, flow.local_port))
                 by_addresses[flow.local < flow.remote]
@@ -136,6 +139,7 @@ std::map<uint8_t, uint32_t> count_flows(const std::vector<flow_ends> &flows,
             const auto other = by_addresses[1].find(addresses);
             count += std::max(number, other == by_addresses[1].end() ? 0 : other->second);
         }
+        // Pairs that occur in this direction only.
         for (const auto &[addresses, number] : by_addresses[1])
             count += by_addresses[0].contains(addresses) ? 0 : number;
     }

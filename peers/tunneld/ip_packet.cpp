@@ -16,6 +16,7 @@ using lanes = uint64_t __attribute__((vector_size(32)));
 constexpr size_t BLOCK_BYTES = 2 * sizeof(lanes);
 
 __attribute__((always_inline)) inline uint64_t sum_lanes(const uint8_t *at, size_t blocks) {
+    // Each lane adds values of 32 bits into 64 and cannot overflow.
     lanes sums[4] = {}; // additions that don't depend on each other
     for (; blocks > 0; blocks--, at += BLOCK_BYTES) {
         lanes first, second;
@@ -46,6 +47,7 @@ constexpr auto best_sum_blocks = sum_blocks;
 #endif
 
 uint16_t fold_sum(uint64_t sum) {
+    // End-around carry: what exceeds 16 bits is added again until nothing does.
     while (sum >> 16)
         sum = (sum & 0xffff) + (sum >> 16);
     return static_cast<uint16_t>(sum);
@@ -62,6 +64,7 @@ uint64_t checksum_add(uint64_t sum, const void *bytes, size_t length) {
     }
     for (; length >= 8; at += 8, length -= 8)
         sum = add_word(sum, at);
+    // An odd last byte is summed as if a zero byte followed it.
     uint8_t rest[8] = {};
     memcpy(rest, at, length);
     return add_word(sum, rest);
@@ -80,6 +83,8 @@ bool checksum_is_right(uint64_t sum) {
 }
 
 uint64_t checksum_pseudo(const ip4_wire_header &ip, size_t length) {
+    // After the two addresses, which follow each other in the header: a zero byte, the protocol and the
+    // length.
     const be16 rest[2] = {to_be16(ip.protocol), to_be16(static_cast<uint16_t>(length))};
     return checksum_add(checksum_add(0, &ip.source, 8), rest, sizeof rest);
 }

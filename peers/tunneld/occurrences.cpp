@@ -5,6 +5,7 @@ void note_counter(occurrences *inout, const std::string &what, uint64_t total, i
         return;
     occurrence &known = (*inout)[what];
     if (total > known.total) {
+        // After a long pause a new series begins.
         if (known.last_ms < 0 || now_ms - known.last_ms > OCCURRENCE_MS)
             known.first_ms = now_ms;
         known.last_ms = now_ms;

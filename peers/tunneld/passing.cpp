@@ -31,6 +31,7 @@ void fill_passing_lookup(const passing_table &table, passing_lookup *out) {
         auto service = std::make_unique<passing_service>();
         service->local = group.local;
         service->by_source_port = group.by_source_port;
+        // Wider than a port: with 16 bits a range that ends at 65535 would never end.
         for (const port_range &range : group.ports)
             for (uint32_t port = range.first; port <= range.last; port++)
                 service->ports.set(port);
@@ -50,9 +51,11 @@ uint32_t find_passing_member(const passing_lookup &lookup, const gre_content &co
     const passing_service *service = lookup.services[redirect.service].get();
     if (!service)
         return 0;
+    // The service and the bucket are those that the router has used for this packet.
     const uint32_t member = service->members[redirect.flags & ALTERNATIVE_USED ? redirect.alternative_bucket
                                                                                : redirect.primary_bucket];
     const tcp_wire_header *tcp = member ? find_tcp_header(content) : nullptr;
+    // A packet that opens a flow stays here: the flow will be this appliance's.
     if (!tcp || (tcp->flags & FLOW_FLAGS) == TCP_SYN ||
         !service->ports[to_host(service->by_source_port ? tcp->source_port : tcp->destination_port)])
         return 0;
@@ -100,6 +103,7 @@ bool take_passing_line(const std::string &line, unsigned *out_number, passing_gr
     while (words >> run) {
         const size_t star = run.find('*');
         uint32_t member = 0;
+        // At most three digits, which std::stoul() can always read.
         if (star == std::string::npos || star == 0 || star > 3 ||
             run.find_first_not_of("0123456789") != star || !parse_address(run.substr(star + 1), &member))
             return false;

@@ -27,6 +27,7 @@ void write_kept_file(const char *path, const std::string &text) {
     std::ofstream file(fresh, std::ios::trunc);
     file << text;
     file.close();
+    // After close(), the state of the stream covers all earlier failures.
     if (!file || rename(fresh.c_str(), path) != 0)
         LC_LOG(LC_LOG_WARNING, "%s: %s", path, strerror(errno));
 }
@@ -85,6 +86,7 @@ std::map<uint8_t, group_protection> find_protections(const owners_table &owners,
         group_protection &made = out[number];
         made.by_mask = group.by_mask;
         made.mask = group.mask;
+        // wccpd's list of members includes this appliance.
         for (const uint32_t member : group.members)
             if (member != view->second.local)
                 made.members.push_back(member);
@@ -103,6 +105,7 @@ std::map<uint8_t, group_cover> find_covers(const appliance_view &view, bool user
         if (!view.intercepts.contains(number) && protection == view.protections.end())
             continue;
         group_cover &cover = out[number];
+        // Only the most general reason is shown.
         if (!enabled)
             cover.reason = "switched off";
         else if (protection == view.protections.end() || protection->second.targets.empty())

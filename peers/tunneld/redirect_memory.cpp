@@ -11,6 +11,7 @@ remembered_redirect read_flow(uint64_t link, const uint8_t *packet, size_t lengt
     const size_t header = ip4_header_length(*ip);
     remembered_redirect flow;
     flow.link = link;
+    // A packet that is returned still has the addresses and ports with which it arrived: nothing is reversed.
     memcpy(&flow.addresses, &ip->source, sizeof flow.addresses);
     flow.protocol = ip->protocol;
     const bool has_ports = ip->protocol == PROTOCOL_TCP || ip->protocol == PROTOCOL_UDP;
@@ -28,6 +29,7 @@ remembered_redirect *find_slot(const redirect_memory &memory, const remembered_r
 
 void remember_redirect(redirect_memory *memory, uint64_t link, const gre_content &content) {
     remembered_redirect flow = read_flow(link, content.packet, content.length);
+    // Found by the real link, before 0 marks the slot as empty.
     remembered_redirect *slot = find_slot(*memory, flow);
     if (!content.has_redirect)
         flow.link = 0;

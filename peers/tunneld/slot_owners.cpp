@@ -15,6 +15,7 @@ namespace {
 bool parse_hexadecimal(const std::string &word, uint64_t max, uint32_t *out) {
     if (word.empty() || word.size() > 8 || word.find_first_not_of("0123456789abcdef") != std::string::npos)
         return false;
+    // Eight digits cannot overflow.
     const unsigned long value = std::stoul(word, nullptr, 16);
     *out = static_cast<uint32_t>(value);
     return value <= max;
@@ -63,11 +64,13 @@ uint32_t slot_mask_bits(const slot_mask &mask) {
 slot_mask slot_value(const slot_mask &mask, uint32_t slot) {
     const auto spread = [&slot](uint32_t bits) {
         uint32_t value = 0;
+        // Each bit of the mask, from the lowest on, takes the next bit of the slot's number.
         for (; bits; bits &= bits - 1, slot >>= 1)
             value |= slot & 1 ? bits & (~bits + 1) : 0;
         return value;
     };
     slot_mask value;
+    // The order of the calls matters: each leaves the rest of the number to the next one.
     value.dst_port = static_cast<uint16_t>(spread(mask.dst_port));
     value.src_port = static_cast<uint16_t>(spread(mask.src_port));
     value.dst_ip = spread(mask.dst_ip);
@@ -99,6 +102,7 @@ bool parse_owners(const std::string &text, owners_report *out) {
     }
     std::sort(out->members.begin(), out->members.end());
     const size_t slots = out->by_mask ? size_t{1} << slot_mask_bits(out->mask) : SLOTS_MAX;
+    // Without "owners" in the text they are unknown. With it, none may be missing.
     return !in_owners || out->owners.size() == slots;
 }
 
@@ -125,6 +129,7 @@ bool note_owners(owners_table *table, uint8_t group, const owners_report &report
         return false;
     const auto found = table->find(group);
     group_owners next = found == table->end() ? group_owners{} : found->second;
+    // Slots of another kind or mask have nothing in common with the old ones.
     if (next.by_mask != report.by_mask || !(next.mask == report.mask))
         next = {report.by_mask, report.mask, {}, {}};
     next.members = report.members;
@@ -134,6 +139,7 @@ bool note_owners(owners_table *table, uint8_t group, const owners_report &report
         replace_owner(&next.slots[i], report.owners[i], now_s);
     for (slot_history &slot : next.slots) {
         std::erase_if(slot.former, [&](const former_owner &one) { return now_s - one.until_s > keep_s; });
+        // The oldest ones are at the end.
         if (slot.former.size() > FORMER_OWNERS_MAX)
             slot.former.resize(FORMER_OWNERS_MAX);
     }
@@ -151,6 +157,7 @@ std::vector<uint32_t> slot_targets(const group_owners &group, uint32_t self, int
     };
     for (const slot_history &slot : group.slots) {
         targets.push_back(0);
+        // Such packets arrive only while a router still uses another table.
         if (is_other(slot.owner)) {
             targets.back() = slot.owner;
             continue;
@@ -159,6 +166,8 @@ std::vector<uint32_t> slot_targets(const group_owners &group, uint32_t self, int
             return std::exp(-static_cast<double>(now_s - time_s) / static_cast<double>(protection_s));
         };
         std::map<uint32_t, double> flows;
+        // The flows that began while it was the owner and still last: an integral, up to a factor that all
+        // share.
         for (const former_owner &one : slot.former)
             if (is_other(one.owner) && now_s - one.until_s < protection_s)
                 flows[one.owner] += left(one.until_s) - left(one.from_s);
@@ -192,6 +201,7 @@ bool take_time(std::istringstream *from, int64_t now_s, int64_t *out) {
     if (!std::getline(*from, word, ',') || word.empty() || word.size() > 12 ||
         word.find_first_not_of("0123456789") != std::string::npos)
         return false;
+    // At most 12 digits, which std::stoll() can always read.
     *out = std::min<int64_t>(std::stoll(word), now_s);
     return true;
 }
@@ -206,6 +216,7 @@ bool take_history(const std::string &text, int64_t now_s, slot_history *out) {
             !take_time(&words, now_s, &one.from_s) || (!first && !take_time(&words, now_s, &one.until_s)) ||
             out->former.size() == FORMER_OWNERS_MAX)
             return false;
+        // The present owner comes first and has no end time.
         if (first) {
             out->owner = one.owner;
             out->since_s = one.from_s;
@@ -217,6 +228,7 @@ bool take_history(const std::string &text, int64_t now_s, slot_history *out) {
 }
 
 bool take_owners_line(const std::string &line, int64_t now_s, uint8_t *out_number, group_owners *out) {
+    // Between the number and "slots", the line has the form of wccpd's text without owners.
     const size_t blank = line.find(' '), slots = line.find(" slots");
     size_t number = 0;
     owners_report head;
