@@ -20,6 +20,7 @@ std::string read_text(const nlattr *attribute) {
     if (!attribute)
         return "";
     const auto *text = static_cast<const char *>(nla_data(attribute));
+    // The kernel's texts end with a zero byte, which is part of the attribute.
     return {text, strnlen(text, static_cast<size_t>(nla_len(attribute)))};
 }
 
@@ -47,6 +48,7 @@ gre_ends read_gre(nlattr *data) {
 
 link_counters read_statistics(const nlattr *attribute) {
     rtnl_link_stats64 all = {};
+    // An older kernel has fewer fields than the headers of this program, a newer one can have more.
     if (attribute)
         memcpy(&all, nla_data(attribute), std::min(sizeof all, static_cast<size_t>(nla_len(attribute))));
     link_counters counters;
@@ -73,6 +75,8 @@ std::optional<found_link> read_link(nlmsghdr *message) {
     link.name = read_text(attributes[IFLA_IFNAME]);
     link.kind = read_text(info[IFLA_INFO_KIND]);
     link.group = read_netlink_u32(attributes[IFLA_GROUP]);
+    // By name as well: a tunneld that was killed between making and marking a link has left it without the
+    // group.
     if ((link.kind != "tun" && link.kind != "gre") || (link.group != LINK_GROUP && !link_number(link.name)))
         return std::nullopt;
     const auto *header = static_cast<const ifinfomsg *>(nlmsg_data(message));
@@ -81,6 +85,7 @@ std::optional<found_link> read_link(nlmsghdr *message) {
     link.mtu = read_netlink_u32(attributes[IFLA_MTU]);
     link.alias = read_text(attributes[IFLA_IFALIAS]);
     link.wish = parse_link_alias(link.alias);
+    // Only GRE links have ends of their own in the kernel. Those of TUN devices are in the alias.
     if (link.kind == "gre")
         link.gre = read_gre(info[IFLA_INFO_DATA]);
     link.counters = read_statistics(attributes[IFLA_STATS64]);
@@ -91,6 +96,7 @@ netlink_message change_link(int index, unsigned flags) {
     ifinfomsg header = {};
     header.ifi_family = AF_UNSPEC;
     header.ifi_index = index;
+    // `ifi_change` is the mask of the flags that are changed.
     header.ifi_flags = header.ifi_change = flags;
     return make_netlink_message(RTM_NEWLINK, 0, &header, sizeof header);
 }
@@ -127,11 +133,14 @@ int bring_link_up(int index) {
 int remove_link(int index) {
     ifinfomsg header = {};
     header.ifi_index = index;
+    // ENODEV: somebody else has removed the link.
     const int error = change_kernel(make_netlink_message(RTM_DELLINK, 0, &header, sizeof header).get());
     return error == ENODEV ? 0 : error;
 }
 
 gre_ends wanted_gre(uint32_t local, uint32_t remote) {
+    // Without a key, and without a checksum on packets that are sent. Without path MTU discovery and with DF
+    // of the inner packet ignored, packets that are too large are fragmented instead of dropped.
     return {local, remote, 0, 0, TUNNEL_TTL, 0, 1};
 }
 

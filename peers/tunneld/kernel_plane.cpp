@@ -57,11 +57,14 @@ bool take_over_gre_link(const std::string &name, const gre_ends &wanted) {
 bool make_kernel_link(const std::string &name, const link_wish &wish, uint32_t *out_index,
                       std::string *out_error) {
     int error = make_gre_link(name, wish.local, wish.remote);
+    // The kernel also refuses a second GRE link with the same ends, whatever its name. If it is a foreign
+    // link, the second attempt fails as well.
     if (error == EEXIST && take_over_gre_link(name, wanted_gre(wish.local, wish.remote)))
         error = 0;
     else if (error == EEXIST)
         error = make_gre_link(name, wish.local, wish.remote);
     *out_index = error ? 0 : if_nametoindex(name.c_str());
+    // Somebody else has removed it in the meantime.
     if (!error && !*out_index)
         error = errno;
     if (error)

@@ -16,6 +16,7 @@ namespace {
 constexpr uint32_t WHOLE_MARK = 0xFFFFFFFF;
 
 std::string name_of_index(int index) {
+    // An interface can be gone before its routes are read. The route then equals no wanted one.
     char name[IFNAMSIZ] = "";
     return index && if_indextoname(static_cast<unsigned>(index), name) ? name : "";
 }
@@ -30,6 +31,7 @@ void read_route(nlmsghdr *message, std::vector<found_route> *out) {
         nlmsg_parse(message, sizeof(rtmsg), attributes, RTA_MAX, nullptr) < 0)
         return;
     const auto *header = static_cast<const rtmsg *>(nlmsg_data(message));
+    // The header has only eight bits for the table's number, like that of rules.
     const uint32_t table = read_netlink_u32(attributes[RTA_TABLE], header->rtm_table);
     if (header->rtm_protocol != ROUTE_PROTOCOL || header->rtm_family != AF_INET || !is_our_table(table))
         return;
@@ -60,6 +62,7 @@ netlink_message route_message(int type, int flags, const wanted_route &route, ui
         header.rtm_scope = RT_SCOPE_HOST;
     else
         header.rtm_scope = route.via ? RT_SCOPE_UNIVERSE : RT_SCOPE_LINK;
+    // The kernel then takes the next hop as a neighbour, without a route to it.
     if (route.via && type == RTM_NEWROUTE)
         header.rtm_flags = RTNH_F_ONLINK;
     auto message = make_netlink_message(type, flags, &header, sizeof header);
@@ -86,6 +89,7 @@ void read_rule(nlmsghdr *message, std::vector<found_rule> *out) {
         found.rule.in_interface.assign(
             static_cast<const char *>(nla_data(name)),
             strnlen(static_cast<const char *>(nla_data(name)), static_cast<size_t>(nla_len(name))));
+    // A rule without a mark has no mask either.
     const uint32_t whole = found.rule.mark ? WHOLE_MARK : 0;
     found.odd = header->action != FR_ACT_TO_TBL || header->src_len || header->dst_len || header->tos ||
                 (header->flags & FIB_RULE_INVERT) || attributes[FRA_OIFNAME] ||
@@ -97,6 +101,7 @@ netlink_message rule_message(int type, int flags, const wanted_rule &rule) {
     fib_rule_hdr header = {};
     header.family = AF_INET;
     header.action = FR_ACT_TO_TBL;
+    // The number of the table does not fit, and is an attribute.
     header.table = RT_TABLE_UNSPEC;
     auto message = make_netlink_message(type, flags, &header, sizeof header);
     nla_put_u32(message.get(), FRA_TABLE, rule.table);
@@ -131,9 +136,11 @@ int find_rules(std::vector<found_rule> *out) {
 }
 
 int put_route(const wanted_route &route) {
+    // A local route needs some device, and lo always exists.
     const unsigned index = if_nametoindex(route.local ? "lo" : route.interface.c_str());
     if (!index)
         return ENODEV;
+    // A different route of the table is replaced in one step: no packet finds the table empty.
     const auto message = route_message(RTM_NEWROUTE, NLM_F_CREATE | NLM_F_REPLACE, route, 0,
                                        route.local ? uint8_t{RTN_LOCAL} : uint8_t{RTN_UNICAST});
     nla_put_u32(message.get(), RTA_OIF, index);
@@ -141,6 +148,7 @@ int put_route(const wanted_route &route) {
 }
 
 int remove_route(const found_route &found) {
+    // Every attribute that was found: the kernel deletes the first route that matches the given ones.
     const auto message = route_message(RTM_DELROUTE, 0, found.route, found.prefix_length, found.type);
     if (found.out_index)
         nla_put_u32(message.get(), RTA_OIF, static_cast<uint32_t>(found.out_index));
@@ -153,6 +161,7 @@ int remove_route(const found_route &found) {
 }
 
 int add_rule(const wanted_rule &rule) {
+    // Without NLM_F_EXCL the kernel would add a second rule that is the same.
     const int error = change_kernel(rule_message(RTM_NEWRULE, NLM_F_CREATE | NLM_F_EXCL, rule).get());
     return error == EEXIST ? 0 : error;
 }

@@ -55,6 +55,7 @@ std::optional<setting_path> split_path(const std::string &path) {
 
 bool is_our_path(const std::string &path) {
     const auto parts = split_path(path);
+    // Paths of the state file are written to. One that leads elsewhere is not accepted.
     return parts &&
            (is_interface_name(parts->interface) || parts->interface == "all" ||
             parts->interface == "default") &&
@@ -76,6 +77,7 @@ std::optional<std::string> read_file(const std::string &path, size_t most) {
     const descriptor file(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
     if (file.fd < 0)
         return std::nullopt;
+    // One byte more than allowed, which shows that the file is too long.
     std::string text(most + 1, '\0');
     size_t length = 0;
     for (ssize_t got = 1; got != 0 && length < text.size(); length += static_cast<size_t>(got)) {
@@ -120,6 +122,7 @@ changed_settings parse_changed_settings(const std::string &text) {
     size_t start = 0;
     for (size_t end; (end = text.find('\n', start)) != std::string::npos; start = end + 1) {
         const std::string line = text.substr(start, end - start);
+        // `more` is read only if something follows the third word. The heading does not match either.
         char path[40], before[5], now[5], more;
         if (sscanf(line.c_str(), "%39s %4s %4s%c", path, before, now, &more) == 3 && is_our_path(path) &&
             is_value(before) && is_value(now))
@@ -140,6 +143,7 @@ void load_changed_settings(std::string *out_error) {
 void save_changed_settings(std::string *out_error) {
     if (!unsaved)
         return;
+    // A file that could not be saved is tried again by the next call.
     std::string text = std::string(STATE_HEADING) + "\n";
     for (const auto &[path, setting] : *changed)
         text += path + " " + setting.before + " " + setting.now + "\n";
@@ -180,6 +184,7 @@ const wanted_setting *find_wanted_setting(const std::vector<wanted_setting> &wan
 }
 
 void note_change(const std::string &path, const std::string &before, const std::string &now) {
+    // An earlier entry has the original value, which a second change must not replace.
     if (changed->insert({path, {before, now}}).second)
         unsaved = true;
 }
@@ -215,14 +220,19 @@ bool apply_settings(const std::vector<wanted_setting> &wanted, std::string *out_
         if (!now || *now == setting.value)
             continue;
         differing.push_back(&setting);
+        // Settings of tunneld's own links disappear with the link.
         if (!setting.restore)
             continue;
+        // The other interfaces are raised only with the first change of `all`, which has its original value.
         const bool is_first = !changed->count(setting.path);
         note_change(setting.path, *now, setting.value);
         if (is_first && setting.path.starts_with("all/"))
             note_raised(wanted, setting.path.substr(4), *now);
     }
+    // Before any setting is written: a tunneld that is killed in between must not lose the original values.
     save_changed_settings(&error);
+    // First the raised interfaces, then `all`, so that no interface is without the setting in between. A
+    // value other than the noted one was set by somebody else and stays.
     for (const auto &[path, setting] : *changed)
         if (is_raised(wanted, path) && read_setting(path) == setting.before)
             write_setting(path, setting.now, &error);
@@ -245,6 +255,8 @@ bool restore_settings(const std::vector<wanted_setting> &wanted, std::string *ou
                           [](const std::string &path) { return path.starts_with("all/"); });
     for (const auto &path : paths) {
         const changed_setting &setting = changed->at(path);
+        // A value that somebody else has changed stays and is forgotten, like that of an interface that is
+        // gone. One that could not be written is tried again.
         if (read_setting(path) == setting.now && !write_setting(path, setting.before, &error))
             continue;
         changed->erase(path);
@@ -257,5 +269,6 @@ bool restore_settings(const std::vector<wanted_setting> &wanted, std::string *ou
 }
 
 void disable_ipv6(const std::string &interface) {
+    // Fails on a host without IPv6, which needs nothing.
     write_file("/proc/sys/net/ipv6/conf/" + interface + "/disable_ipv6", 0, "1");
 }

@@ -44,6 +44,7 @@ struct failure {
 };
 
 bool same_ends(const link_wish &one, const link_wish &other) {
+    // A passing link has the ends of the member's link.
     return one.local == other.local && one.remote == other.remote &&
            (one.kind == link_kind::passing) == (other.kind == link_kind::passing);
 }
@@ -92,6 +93,7 @@ bool make_marked_link(const data_plane &plane, const wanted_link &link, found_li
     if (&plane != &table_plane && !remove_other_link(plane, link, found, failed))
         return false;
     const auto known = made.find(link.name);
+    // Also when only the tunnel's id has changed: the plane keeps the link, and its alias is written again.
     if (known == made.end() || known->second.wish != link.wish) {
         uint32_t index = 0;
         std::string error;
@@ -100,6 +102,7 @@ bool make_marked_link(const data_plane &plane, const wanted_link &link, found_li
             return false;
         }
         made[link.name] = {link.wish, index};
+        // A new interface has nothing of what was found under its name.
         if (&plane != &table_plane && index != static_cast<uint32_t>(found->index)) {
             *found = {};
             found->index = static_cast<int>(index);
@@ -117,6 +120,7 @@ bool make_marked_link(const data_plane &plane, const wanted_link &link, found_li
 void bring_up(const wanted_link &link, const found_link &found, failure *failed) {
     if (found.is_up)
         return;
+    // While the link is still down: the kernel sends its first packets as soon as it is up.
     disable_ipv6(link.name);
     failed->note("cannot bring link " + link.name + " up", bring_link_up(found.index));
 }
@@ -156,6 +160,7 @@ void remove_rules(const wanted_state &wanted, const std::vector<found_rule> &fou
 }
 
 void drop_unwanted_made_links(const data_plane &plane, const wanted_state &wanted, failure *failed) {
+    // Collected first, since dropping a link changes the table.
     std::vector<std::string> names;
     for (const auto &[name, link] : made)
         if (!find_wanted_link(wanted, name))
@@ -207,12 +212,14 @@ bool reconcile_links(const data_plane &plane, const wanted_state &wanted, kernel
     if (error)
         return false;
     std::map<std::string, found_link> found;
+    // By name; a missing link gets an entry that is empty.
     for (const auto &link : there->links)
         found[link.name] = link;
     for (const auto &link : wanted.links)
         if (make_marked_link(plane, link, &found[link.name], failed))
             (*out_indices)[link.name] = static_cast<uint32_t>(found[link.name].index);
     std::string text;
+    // After the links exist, and before they carry packets.
     if (!apply_settings(wanted.settings, &text))
         failed->note(text);
     for (const auto &link : wanted.links)
@@ -236,6 +243,7 @@ std::vector<wanted_link> find_own_links() {
     if (find_links(false, &found))
         return links;
     for (const auto &link : found) {
+        // Of two links with the same ends only the first is taken over.
         const bool is_known = link.wish && link_number(link.name) &&
                               std::none_of(links.begin(), links.end(), [&](const wanted_link &other) {
                                   return same_ends(other.wish, *link.wish);
@@ -263,6 +271,7 @@ bool reconcile_kernel_state(const data_plane &plane, const wanted_state &wanted,
     std::string error;
     if (!apply_sorting_rules(wanted.sorting, &error))
         failed.note(error);
+    // From now on the plane passes packets on, for which the rules and routes are ready.
     if (plane.set_passing)
         plane.set_passing(wanted.passing);
     remove_unwanted(plane, wanted, there, &failed);
@@ -277,6 +286,8 @@ bool reconcile_kernel_links(const data_plane &plane, const wanted_state &wanted,
     if (!reconcile_links(plane, wanted, &there, out_indices, &failed) ||
         !find_routes_and_rules(&there, &failed))
         return failed.give(out_error);
+    // A route that the earlier tunneld has left stays even if it differs: how packets are to be returned is
+    // not known yet.
     wanted_state missing = wanted;
     std::erase_if(missing.routes, [&](const wanted_route &route) {
         return std::any_of(there.routes.begin(), there.routes.end(), [&](const found_route &one) {
@@ -313,6 +324,7 @@ bool remove_kernel_state(const data_plane &plane, std::string *out_error) {
         return failed.give(out_error);
     }
     std::string error;
+    // First of all the rules that lead packets into the rest.
     if (!remove_sorting_rules(&error))
         failed.note(error);
     kernel_view there;

@@ -20,6 +20,7 @@ std::string link_name(uint32_t number) {
 
 std::optional<uint32_t> link_number(const std::string &name) {
     const size_t start = sizeof LINK_PREFIX - 1;
+    // Five digits cannot overflow.
     if (!name.starts_with(LINK_PREFIX) || name.size() == start || name.size() > start + 5)
         return std::nullopt;
     uint32_t number = 0;
@@ -28,6 +29,7 @@ std::optional<uint32_t> link_number(const std::string &name) {
             return std::nullopt;
         number = number * 10 + static_cast<uint32_t>(digit - '0');
     }
+    // The second comparison excludes leading zeros.
     if (number > UINT16_MAX || link_name(number) != name)
         return std::nullopt;
     return number;
@@ -43,6 +45,7 @@ std::optional<link_wish> parse_link_alias(const std::string &alias) {
     char local[INET_ADDRSTRLEN], remote[INET_ADDRSTRLEN], word[10] = "";
     uint16_t id;
     in_addr from, to;
+    // The fourth word is only there for some kinds of links.
     if (alias.size() > ALIAS_CHARACTERS ||
         sscanf(alias.c_str(), "tunneld %5hu %15s %15s %9s", &id, local, remote, word) < 3 ||
         inet_pton(AF_INET, local, &from) != 1 || inet_pton(AF_INET, remote, &to) != 1)
@@ -56,6 +59,8 @@ std::optional<link_wish> parse_link_alias(const std::string &alias) {
 }
 
 bool is_interface_name(const std::string &name) {
+    // Names become parts of paths below /proc/sys, where "all" and "default" are not interfaces, and of texts
+    // for nftables.
     if (name.empty() || name.size() >= IFNAMSIZ || name == "." || name == ".." || name == "all" ||
         name == "default")
         return false;

@@ -29,6 +29,7 @@ nl_sock *open_kernel_socket() {
         kernel.reset();
         return nullptr;
     }
+    // Requests ask for an acknowledgement where they need one.
     nl_socket_disable_auto_ack(kernel.get());
     // The kernel then filters dumps by the request's header. An old kernel ignores it and sends everything.
     const int on = 1;
@@ -75,6 +76,7 @@ int exchange_messages(nl_msg *message, const std::function<void(nlmsghdr *)> *ea
         throw std::bad_alloc();
     exchange state;
     state.each = each;
+    // A change ends with an acknowledgement, a dump with its last message, and either can end with an error.
     nl_cb_err(callbacks.get(), NL_CB_CUSTOM, take_error_answer, &state);
     nl_cb_set(callbacks.get(), NL_CB_FINISH, NL_CB_CUSTOM, take_last_answer, &state);
     nl_cb_set(callbacks.get(), NL_CB_ACK, NL_CB_CUSTOM, take_last_answer, &state);
@@ -114,6 +116,7 @@ int change_kernel(nl_msg *message) {
 int query_kernel(nl_msg *message, const std::function<void(nlmsghdr *)> &each,
                  const std::function<void()> &restart) {
     int error = EINTR;
+    // On a busy host the table can change during every dump: the last attempt's error is returned.
     for (int i = 0; i < QUERY_TRIES && error == EINTR; i++) {
         restart();
         error = exchange_messages(message, &each);

@@ -15,6 +15,7 @@ bool open_nft(std::string *out_error) {
         *out_error = "nftables: out of memory";
         return false;
     }
+    // Without numeric output, names would be looked up in files like /etc/services.
     nft_ctx_output_set_flags(context, NFT_CTX_OUTPUT_JSON | NFT_CTX_OUTPUT_NUMERIC_ALL);
     return true;
 }
@@ -58,6 +59,7 @@ bool run_nft(const std::string &commands, std::string *out_error) {
 bool check_nft(const std::string &commands, std::string *out_error) {
     if (!open_nft(out_error))
         return false;
+    // The kernel checks the whole transaction and then does not commit it.
     nft_ctx_set_dry_run(context, true);
     const bool fits = run_commands(commands, nullptr, out_error);
     nft_ctx_set_dry_run(context, false);
@@ -68,6 +70,7 @@ bool list_nft(const std::string &command, nlohmann::json *out_objects, std::stri
     std::string output;
     if (!run_commands(command, &output, out_error))
         return false;
+    // Without exceptions: a text that is not JSON gives a value that is not an object.
     const nlohmann::json reply = nlohmann::json::parse(output, nullptr, false);
     if (!reply.is_object() || !reply.contains("nftables") || !reply["nftables"].is_array()) {
         *out_error = "nftables: bad answer to \"" + command + '"';

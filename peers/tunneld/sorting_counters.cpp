@@ -41,6 +41,7 @@ void take_counter(sorting_counters *out, const std::string &name, const packet_c
         if (packet_count *way = find_way(out->interfaces[of], what))
             *way = count;
     } else if (kind == "group") {
+        // A group has no counter for `in`: it is the sum of the others.
         packet_count(&ways)[SORTED_WAYS] =
             out->groups[static_cast<uint8_t>(strtoul(of.c_str(), nullptr, 10))];
         if (packet_count *way = find_way(ways, what))
@@ -64,6 +65,8 @@ bool list_pairs(const char *set, std::map<std::pair<uint32_t, uint32_t>, uint64_
         if (!object.contains("set") || !object["set"].contains("elem"))
             continue;
         for (const nlohmann::json &element : object["set"]["elem"]) {
+            // nftables lists an element with a counter as an object around the value, and others as the
+            // value.
             const bool counts = element.contains("elem");
             const nlohmann::json &value = counts ? element["elem"].value("val", nlohmann::json()) : element;
             uint32_t source = 0, destination = 0;

@@ -72,6 +72,7 @@ bool take_table_over(const nft_content &wanted, std::string *out_error) {
     if (!read_left_content(&left, out_error))
         return false;
     const std::string create = make_sorting_transaction({}, wanted);
+    // Adding a table that exists changes nothing, and deleting one that does not exist would fail.
     const std::string delete_all =
         std::string("add table ip ") + RULES_TABLE + "\ndelete table ip " + RULES_TABLE + "\n";
     if (wanted.empty())
@@ -99,6 +100,7 @@ bool apply_sorting_rules(const wanted_sorting &wanted, std::string *out_error) {
     if (!make_sorting_content(wanted, &content, out_error))
         return false;
     if (held) {
+        // Without a change it is still checked whether somebody else has removed the table.
         const std::string change = make_sorting_transaction(*held, content);
         if (change.empty() ? is_table_there() != content.empty() : run_nft(change, out_error)) {
             held = content;

@@ -55,6 +55,7 @@ std::set<std::string> merge_prefixes(std::vector<ip_prefix> prefixes) {
     const auto mask = [](uint8_t length) { return length == 0 ? 0 : ~0u << (32 - length); };
     for (ip_prefix &prefix : prefixes)
         prefix.address &= mask(prefix.length);
+    // In this order a prefix comes directly before those that lie within it.
     std::sort(prefixes.begin(), prefixes.end(), [](const ip_prefix &a, const ip_prefix &b) {
         return a.address != b.address ? a.address < b.address : a.length < b.length;
     });
@@ -86,11 +87,13 @@ using taken_ports = std::map<uint32_t, std::pair<uint32_t, uint8_t>>;
 // Gives the group those ports of the range that don't belong to another group yet.
 void take_ports(taken_ports *taken, uint32_t first, uint32_t last, uint8_t group) {
     while (first <= last) {
+        // Ranges that are taken do not overlap: only the one that begins last before `first` can contain it.
         const auto next = taken->upper_bound(first);
         if (next != taken->begin() && std::prev(next)->second.first >= first) {
             first = std::prev(next)->second.first + 1;
             continue;
         }
+        // The gap ends where the next taken range begins.
         const uint32_t end = next == taken->end() ? last : std::min(last, next->first - 1);
         (*taken)[first] = {end, group};
         first = end + 1;
@@ -135,6 +138,7 @@ void add_way_chains(content_maker &maker) {
     const std::string unmarked = format_text("meta mark != 0x%08x ", MARK_LOCAL);
     for (const char *way : {"returned", "bypassed", "own", "down", "overload"})
         maker.rules(way) = {count(way), unmarked + "meta mark set iifname map @give_back"};
+    // The packets have a mark already, or came by a passing link, whose own table leads to the member.
     maker.rules("passed") = {count("passed")};
     maker.rules("to_proxy") = {mark_as(MARK_LOCAL), count("to_proxy")};
     maker.rules("forwarded") = {unmarked + mark_as(MARK_FORWARD), count("forwarded")};
@@ -182,6 +186,7 @@ std::string make_pass_rule(content_maker &maker, const sorted_group &group) {
     nft_set &map = maker.set(name, "map { type " + join_fields(group.mask, [](const mask_field &field) {
                                        return field.type;
                                    }) + " : mark; }");
+    // A slot without an element ends the rule at the look-up, and the next rule is tried.
     for (uint32_t slot = 0; slot < group.pass_marks.size(); slot++)
         if (group.pass_marks[slot]) {
             const slot_mask value = slot_value(group.mask, slot);
@@ -223,6 +228,8 @@ void add_group(content_maker &maker, const sorted_group &group) {
         rules.push_back(NOT_JUST_SYN + (" " + ends_as(SORTED_RETURNED, "returned")));
     const intercept_condition &now = group.condition;
     if (now.draining || !now.active || !now.proxy_up) {
+        // `down drop` is about the proxy. While the group is not active, its packets are returned all the
+        // same.
         const bool drop = (now.draining || now.active) && wish.drop_when_down;
         rules.push_back(ends_as(SORTED_DOWN, drop ? "down_dropped" : "down"));
         return;
@@ -256,6 +263,7 @@ std::string make_rest_rule(const std::vector<const sorted_group *> &groups) {
     for (const auto &row : ways)
         if (row.rest == rest)
             way = row.way;
+    // With several groups it is not known for which of them to count the packet.
     std::string rule = std::string("goto ") + sorted_words[way];
     if (groups.size() == 1 && wants_something(*groups[0]))
         rule = group_counter(groups[0]->group, way) + " " + rule;
@@ -348,6 +356,8 @@ void add_arrival_chains(content_maker &maker) {
         };
     maker.content.chains["sort"] = {"type filter hook prerouting priority -150; policy accept;",
                                     {"iifname vmap @arrivals"}};
+    // Here the interface's ordinary traffic arrives as well: packets to this host itself, and frames that are
+    // not addressed to it.
     maker.rules("arrived_l2") = {"fib daddr type != unicast accept", "meta pkttype != host accept",
                                  "goto arrived"};
     nft_set &own = maker.set("own_addresses", "set { type ipv4_addr; }");
@@ -465,6 +475,7 @@ bool make_sorting_content(const wanted_sorting &wanted, nft_content *out, std::s
     *out = {};
     if (!check_sorting(wanted, out_error))
         return false;
+    // The empty content means that there is no table.
     if (wanted.links.empty() && wanted.l2_interfaces.empty() && wanted.groups.empty() && wanted.ends.empty())
         return true;
     content_maker maker{wanted, *out, {}};
@@ -557,6 +568,7 @@ std::string make_sorting_transaction(const nft_content &before, const nft_conten
     }
     if (before.empty())
         change.text = std::string("add table ip ") + RULES_TABLE + "\n";
+    // Counters and chains first: the elements of maps refer to them.
     for (const std::string &name : after.counters)
         if (!before.counters.contains(name))
             change.add("add counter", name);
@@ -564,6 +576,8 @@ std::string make_sorting_transaction(const nft_content &before, const nft_conten
         if (!before.chains.contains(name))
             change.add("add chain", name, chain.declaration.empty() ? "" : "{ " + chain.declaration + " }");
     for (const auto &[name, chain] : before.chains) {
+        // Rules that are gone or change: they would keep sets from being deleted. Those of an earlier tunneld
+        // are not known, and are all written anew.
         const nft_chain *wanted = find_in(after.chains, name);
         if (!before.known || !wanted || wanted->rules != chain.rules)
             change.add("flush chain", name);
@@ -573,6 +587,7 @@ std::string make_sorting_transaction(const nft_content &before, const nft_conten
             const size_t body = set.declaration.find(' ');
             change.add(("add " + kind_of(set)).c_str(), name, set.declaration.substr(body + 1));
         }
+    // Elements of a set that will be deleted may refer to a chain or a counter that is deleted as well.
     for (const auto &[name, set] : before.sets)
         if (!after.sets.contains(name) && !set.filled_by_rules)
             change.add(("flush " + kind_of(set)).c_str(), name);

@@ -18,6 +18,7 @@ std::map<std::string, table_link> links;
 
 uint32_t take_table_index() {
     const uint32_t index = table_plane_next_index;
+    // NO_INDEX itself stays: a test that sets it wants every add to fail.
     if (index != NO_INDEX && ++table_plane_next_index == NO_INDEX)
         table_plane_next_index = 1;
     return index;
