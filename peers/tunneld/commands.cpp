@@ -118,12 +118,15 @@ uint32_t add_ordered_tunnel(command_desk *desk, const mailbox_command &command) 
         it = replaced ? desk->tunnels.erase(it) : std::next(it);
     }
     const command_tunnel wanted = {command.local, command.remote, WCCP_NO_INDEX};
+    // insert() leaves the entry of a known tunnel, and its index, unchanged.
     const auto [tunnel, is_new] = desk->tunnels.insert({command.tunnel_id, wanted});
     apply_table(desk); // also for a known tunnel: somebody may have removed its interface
     if (!desk->apply && is_new)
         tunnel->second.index = take_next_index(desk);
     const uint32_t index = tunnel->second.index;
     if (index == WCCP_NO_INDEX) {
+        // What was made of the tunnel is removed again: wccpd regards the add as failed and does not delete
+        // it.
         desk->tunnels.erase(command.tunnel_id);
         apply_table(desk);
     }
@@ -164,6 +167,7 @@ uint32_t execute_command(command_desk *desk, const mailbox_command &command, uin
     case MAILBOX_ADD_TUNNEL:
         *out_index = add_ordered_tunnel(desk, command);
         desk->ordered.insert(command.tunnel_id);
+        // The status is success all the same: wccpd takes a missing index for a failure.
         if (*out_index == WCCP_NO_INDEX)
             *out_result = "done, without an index";
         return 0;
@@ -194,6 +198,7 @@ void watch_wccpd(command_desk *desk, int64_t now_ms) {
     desk->wccpd_lives = pid != 0 && lives;
     if (!desk->wccpd_lives || pid == desk->wccpd_pid)
         return;
+    // After a restart of tunneld, the file says whether this wccpd has ordered the tunnels that were found.
     const int32_t before = desk->wccpd_pid ? desk->wccpd_pid : read_wccpd_pid();
     desk->wccpd_pid = pid;
     if (pid == before)
@@ -230,6 +235,7 @@ void print_roles(command_desk *desk) {
         const auto group = static_cast<uint16_t>(i);
         const uint32_t role = wccp_get_role(group);
         const auto known = desk->roles.find(group);
+        // Roles other than UNKNOWN (2) are kept: most of the 65536 policy groups have none.
         if (role == (known == desk->roles.end() ? 2 : known->second))
             continue;
         if (role == 2)
@@ -262,6 +268,8 @@ bool take_command(command_desk *desk, bool *out_end) {
         desk->passed_over = command;
         return false;
     }
+    // Before the command is executed: for a new wccpd this clears `ordered`, to which the command may add a
+    // tunnel.
     watch_wccpd(desk, lt_monotonic_ms());
     const mailbox_command given = command;
     const auto before = desk->tunnels;

@@ -21,6 +21,7 @@ void count_all_flows(tunneld *daemon) {
     std::vector<flow_ends> flows;
     std::string error;
     const bool good = read_transparent_flows(daemon->own_addresses, &flows, &error);
+    // The same failure is logged once, not every second.
     if (error != daemon->uncounted && !good)
         LC_LOG(LC_LOG_ERR, "Flows are not counted: %s", error.c_str());
     daemon->uncounted = error;
@@ -88,6 +89,7 @@ void update_followed_groups(tunneld *daemon) {
             ++at;
             continue;
         }
+        // The defaults: the full weight and no overload.
         group.decided = {};
         report_decisions(daemon, id, &group);
         at = daemon->followed.erase(at);
@@ -104,6 +106,7 @@ void follow_groups(tunneld *daemon) {
     if (!daemon->management || daemon->configured_ms < 0 || daemon->takes_over)
         return;
     if (const uint32_t session = mgmt_link_session(daemon->management); session != daemon->reported_session) {
+        // mgmtd has forgotten these reports with the old session, or still has those of an earlier tunneld.
         daemon->reported_session = session;
         for (auto &[id, group] : daemon->followed) {
             group.reported_percent = 0;
@@ -112,6 +115,7 @@ void follow_groups(tunneld *daemon) {
         }
     }
     update_followed_groups(daemon);
+    // Listing the sockets of a busy host takes milliseconds, and is saved where no decision depends on it.
     if (needs_flows(*daemon))
         count_all_flows(daemon);
     const int64_t now = lt_monotonic_ms();

@@ -75,6 +75,7 @@ namespace {
 
 int64_t next_wait_ms(watched_proxy *self) {
     const auto interval = static_cast<int64_t>(self->check.interval_s) * 1000;
+    // Up to 5 % earlier or later, so that checks that begin together drift apart.
     std::uniform_int_distribution<int64_t> spread(-interval / 20, interval / 20);
     return interval + spread(self->owner->random);
 }
@@ -110,6 +111,7 @@ void finish_check(watched_proxy *self, const std::string &failure) {
     health_monitor *monitor = self->owner;
     stop_check(self);
     self->phase = watched_proxy::waiting;
+    // The interval counts from the end of a check, whatever its result.
     if (loop_event_set_timer(self->timer, next_wait_ms(self)) != LC_OK)
         LC_LOG(LC_LOG_ERR, "The proxy of group %d is no longer checked: no timer", self->group);
     proxy_health &health = monitor->states[self->group];
@@ -120,6 +122,7 @@ void finish_check(watched_proxy *self, const std::string &failure) {
         health.reason = failure;
     }
     const auto wanted = good ? proxy_health::up : proxy_health::down;
+    // A result that agrees with the state ends a series of contrary ones.
     self->row = health.state == wanted ? 0 : self->row + 1;
     const bool enough = !self->settled || self->row >= (good ? self->check.rise : self->check.fall);
     self->settled = true;
@@ -147,6 +150,7 @@ std::string describe_socket_error(int error) {
 
 void judge_answer(watched_proxy *self, bool ended) {
     const size_t line = self->answer.find('\n');
+    // The status is in the first line. The rest of the answer is not read.
     if (line == std::string::npos && !ended && self->answer.size() < ANSWER_MAX_BYTES)
         return;
     int major = 0, minor = 0, status = 0;
@@ -179,6 +183,7 @@ void send_http_request(watched_proxy *self) {
         finish_check(self, describe_socket_error(errno));
         return;
     }
+    // The socket may take only a part; the rest is sent when it is writable again.
     self->unsent.erase(0, static_cast<size_t>(std::max<ssize_t>(count, 0)));
     if (self->unsent.empty() && loop_event_set_fd(self->socket, self->fd, LOOP_READ) != LC_OK)
         finish_check(self, "no room for a check");
@@ -188,6 +193,7 @@ void take_socket_event(int, short flags, void *data) {
     auto *self = static_cast<watched_proxy *>(data);
     int error = 0;
     socklen_t length = sizeof error;
+    // The first event is the end of connect(), whose result the socket keeps as its error.
     (void)getsockopt(self->fd, SOL_SOCKET, SO_ERROR, &error, &length);
     if (error)
         finish_check(self, describe_socket_error(error));
@@ -235,12 +241,15 @@ int spawn_command(const std::string &file, pid_t *out_pid) {
     posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
     posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
     posix_spawn_file_actions_addclosefrom_np(&actions, STDERR_FILENO + 1);
+    // A process group of its own, with which the command's children can be killed. Signals that this program
+    // ignores or blocks would be inherited otherwise.
     posix_spawnattr_setpgroup(&attributes, 0);
     posix_spawnattr_setsigmask(&attributes, &none);
     posix_spawnattr_setsigdefault(&attributes, &all);
     posix_spawnattr_setflags(&attributes,
                              POSIX_SPAWN_SETPGROUP | POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF);
     char *arguments[] = {const_cast<char *>(file.c_str()), nullptr};
+    // The environment consists of pointers to writable text.
     char path[sizeof COMMAND_PATH];
     memcpy(path, COMMAND_PATH, sizeof path);
     char *environment[] = {path, nullptr};
@@ -265,6 +274,7 @@ std::string begin_command(watched_proxy *self) {
     pid_t pid = 0;
     if (const int error = spawn_command(self->check.argument, &pid))
         return self->check.argument + ": " + strerror(error);
+    // The event keeps a pointer to the element, which a list does not move.
     running_command &command = monitor->commands.emplace_back();
     command.owner = monitor;
     command.pid = pid;
@@ -297,6 +307,7 @@ void take_command_end(int, short, void *data) {
     const bool known = waitid(P_PIDFD, static_cast<id_t>(command->pidfd), &info, WEXITED | WNOHANG) == 0;
     if (known && info.si_pid == 0)
         return; // it has not ended yet
+    // A command that was killed because its time was up has no check any more.
     watched_proxy *check = nullptr;
     for (const auto &[group, each] : monitor->checks)
         if (each->command == command)

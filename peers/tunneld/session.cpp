@@ -144,6 +144,7 @@ bool send_interest(mgmt_link *link, const char *event, std::initializer_list<con
 
 void send_event(mgmt_link *link, const char *name, const std::vector<event_field> &fields) {
     owned_request msg;
+    // The answer to an event is not waited for: a report that is lost is repeated in the next session.
     if (link->stage != mgmt_link::open || bn_event_request_msg_create(&msg.pointer, name) != LC_OK)
         return;
     for (const event_field &field : fields) {
@@ -174,6 +175,7 @@ void log_complaints(mgmt_link *link, std::vector<std::string> complaints) {
 // False when the message is not the answer to `waiting`. `out_came`: it is one with nodes, not a refusal.
 bool take_answer(request *waiting, const bn_response_msg *msg, std::vector<event_field> *out,
                  bool *out_came) {
+    // The answer to a request that was given up has a number that nothing waits for any more.
     if (waiting->id == 0 || msg->response_to != waiting->id)
         return false;
     waiting->id = 0;
@@ -189,6 +191,7 @@ lc_status take_response(gcl_session *, bn_response_msg *msg, void *data) {
         if (!link->has_configured) { // for example when this program has not read from the session for long
             log_complaints(link, {std::string("The configuration was refused: ") +
                                   (msg->return_message ? ts_str(msg->return_message) : "")});
+            // A change that was announced meanwhile may already have set an earlier time.
             link->read_at_ms = std::min(link->read_at_ms, lt_monotonic_ms() + RETRY_MS);
         }
         advance_soon(link);
@@ -207,6 +210,7 @@ lc_status ignore_response(gcl_session *, bn_response_msg *, void *) {
 lc_status take_event(gcl_session *, bn_request_msg *msg, void *data) {
     auto *link = static_cast<mgmt_link *>(data);
     const std::string name = msg->text ? ts_str(msg->text) : "";
+    // Every event can mean other routers or roles. Only these two mean another configuration.
     if (name == EVENT_CONFIG_CHANGE || name == EVENT_DRAIN)
         link->read_at_ms = lt_monotonic_ms();
     ask_routers_now(link);
@@ -225,6 +229,7 @@ state_tree build_state_tree(const std::vector<state_node> &nodes) {
         if (name.parts.empty())
             continue;
         out[name] = &node;
+        // A walk needs the nodes above as well, which the list does not have.
         for (name.parts.pop_back(); !name.parts.empty(); name.parts.pop_back())
             out.try_emplace(name, nullptr);
     }
@@ -257,6 +262,7 @@ lc_status get_state(const char *name, const tstr_array *, void *data, bn_binding
 lc_status iterate_state(const char *name, const tstr_array *, void *data, tstr_array *out) {
     const auto *tree = static_cast<const state_tree *>(data);
     const node_name above = parsed_name(name);
+    // In the order of the map, everything below a node follows it directly.
     for (auto at = tree->upper_bound(above); at != tree->end() && at->first.is_under(above); ++at)
         if (at->first.parts.size() == above.parts.size() + 1)
             CHECK_STATUS(tstr_array_append_str(out, at->first.parts.back().c_str()));
@@ -283,6 +289,7 @@ void drop_session(mgmt_link *link) {
         LC_LOG(LC_LOG_NOTICE, "Session with mgmtd lost; tunnels and intercepts stay as they are");
     link->stage = mgmt_link::closed;
     LOG_STATUS(gcl_session_free(&link->session));
+    // Nothing is asked again: the next session reads everything anew.
     link->configuration = link->groups = link->routers = link->owners = {};
     link->has_configured = link->has_listed = link->has_states = link->has_owned = link->announced = false;
     link->read_at_ms = link->ask_routers_at_ms = link->ask_owners_at_ms = NEVER;
@@ -294,6 +301,7 @@ void connect_quietly(mgmt_link *link) {
     link->connect_at_ms = lt_monotonic_ms() + RETRY_MS;
     if (access(provider_path().c_str(), W_OK) != 0)
         return;
+    // The library logs every failed attempt.
     const int suspended = G_logging_suspended.exchange(1);
     const bool connected =
         gcl_session_client_new(link->instance, "tunneld", nullptr, 0, &link->session) == LC_OK &&
@@ -406,6 +414,7 @@ bool knows_all_routers(const mgmt_link *link) {
 }
 
 void fill_in_wccpd_state(const mgmt_link *link, configured_view *inout) {
+    // Read each time, because the address of an interface can change without any event of mgmtd.
     const std::map<std::string, uint32_t> addresses = find_interface_addresses();
     for (auto &[id, group] : inout->groups) {
         const auto found = addresses.find(group.interface);
@@ -421,6 +430,7 @@ void fill_in_wccpd_state(const mgmt_link *link, configured_view *inout) {
 }
 
 bool wants_owners(const mgmt_link *link) {
+    // Without an intercept no flow is accepted here, and none has to be protected.
     return link->announced && link->view.protection_s != 0 && !link->view.intercepts.empty();
 }
 
@@ -473,12 +483,14 @@ void process_answers(mgmt_link *link) {
     }
     if (link->has_states) {
         link->gathered.insert(link->gathered.end(), link->states.begin(), link->states.end());
+        // The states are complete, and are looked at, when all groups have been queried.
         link->has_states = link->unasked.empty();
         if (link->has_states)
             link->states = std::move(link->gathered);
         else
             query_routers(link);
     }
+    // An empty list is an answer as well: routers that are no longer listed are forgotten in time.
     const bool answered = link->has_listed || link->has_states;
     if (link->has_listed)
         query_listed_groups(link);
@@ -495,9 +507,12 @@ void process_answers(mgmt_link *link) {
     if (owned)
         for (const auto &[group, text] : read_group_owners(link->owned))
             link->callbacks.owners(group, text);
+    // Answers about wccpd complete a configuration: before the first one of this session there is none to
+    // complete.
     if (!configured && (!answered || !link->announced))
         return;
     fill_in_wccpd_state(link, &next);
+    // A new session is always announced, since the caller then repeats its reports.
     if (link->announced && next == link->view)
         return;
     link->announced = true;
@@ -527,11 +542,14 @@ void send_due_requests(mgmt_link *link) {
         if (!send_walks(link, list_configuration_roots(), bn_qf_subtree, &link->configuration))
             link->read_at_ms = now + RETRY_MS;
     }
+    // One round: first the list of groups, then the routers and owners of those that it names. The next one
+    // begins when all three have been answered.
     if (!may_ask(&link->routers, now, now) || !may_ask(&link->owners, now, now) ||
         !may_ask(&link->groups, next_group_query_ms(link), now))
         return;
     (void)send_walks(link, {NODE_GROUP_STATE}, 0, &link->groups);
     link->ask_owners_at_ms = now + OWNERS_MS;
+    // A round may be due for the owners alone.
     link->routers_are_due = link->ask_routers_at_ms <= now;
     if (!link->routers_are_due)
         return;
@@ -548,6 +566,7 @@ int64_t next_step_ms(const mgmt_link *link) {
         return link->connect_at_ms - now;
     case mgmt_link::greeting:
     case mgmt_link::opening:
+        // The steps of the opening are polled, and less often the longer mgmtd takes.
         return std::max(OPENING_STEP_MS, (now - link->opened_ms) / 4);
     default:
         break;
@@ -556,6 +575,7 @@ int64_t next_step_ms(const mgmt_link *link) {
     for (const request *waiting : {&link->configuration, &link->groups, &link->routers, &link->owners})
         if (waiting->id)
             next = std::min(next, waiting->deadline_ms);
+    // While a request waits for its answer, the next one of its kind is not sent.
     if (!link->configuration.id)
         next = std::min(next, link->read_at_ms);
     if (!link->groups.id && !link->routers.id && !link->owners.id)
@@ -671,6 +691,7 @@ void mgmt_link_overload(mgmt_link *link, uint8_t group, bool overloaded, const s
 }
 
 void mgmt_link_forget_roles(mgmt_link *link) {
+    // In the view as well: the next report of the same roles is then a change.
     link->roles.clear();
     for (auto &[id, group] : link->view.groups)
         group.active = group.alone = false;

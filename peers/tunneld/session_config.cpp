@@ -18,6 +18,7 @@ namespace {
 bool parse_number(const std::string &text, int64_t min, int64_t max, int64_t *out) {
     if (text.empty() || text.size() > 12 || text.find_first_not_of("0123456789") != std::string::npos)
         return false;
+    // At most 12 digits, which always fit.
     *out = std::stoll(text);
     return *out >= min && *out <= max;
 }
@@ -62,6 +63,7 @@ bool parse_prefix(const std::string &text, ip_prefix *out) {
         (slash != std::string::npos && !parse_number(text.substr(slash + 1), 0, 32, &length)))
         return false;
     out->length = static_cast<uint8_t>(length);
+    // A shift by 32 bits would be undefined.
     out->address &= length ? UINT32_MAX << (32 - length) : 0;
     return true;
 }
@@ -74,6 +76,7 @@ bool parse_ports(const std::string &text, std::vector<port_range> *out) {
     for (std::string word; words >> word;) {
         const size_t dash = word.find('-');
         port_range range{};
+        // The first port is the lower bound of the second: 90-80 is refused.
         if (out->size() == PORT_RANGES_MAX || !take_number(word.substr(0, dash), 1, 65535, &range.first) ||
             !take_number(dash == std::string::npos ? word : word.substr(dash + 1), range.first, 65535,
                          &range.last))
@@ -89,6 +92,7 @@ namespace {
 bool take_prefixes(const std::string &text, std::vector<ip_prefix> *out) {
     out->clear();
     std::istringstream words(text);
+    // A bad prefix does not make the others invalid: a bypass that is left out would intercept its packets.
     bool good = true;
     for (std::string word; words >> word;) {
         ip_prefix prefix{};
@@ -157,6 +161,8 @@ void read_intercept(reading *self, uint8_t group, const std::string &leaf, const
     for (const intercept_node &node : intercept_nodes) {
         if (leaf != node.name)
             continue;
+        // The first node of an intercept creates it, with defaults. leave_out_unsound() removes it if
+        // something is missing.
         const bool good = node.take(text, &self->view.intercepts[group]);
         self->taken[group][leaf] = good;
         if (!good && !node.needed)
@@ -166,6 +172,7 @@ void read_intercept(reading *self, uint8_t group, const std::string &leaf, const
 }
 
 void leave_out_unsound(reading *self) {
+    // Only after all nodes have been read, whose order is not known.
     for (auto at = self->view.intercepts.begin(); at != self->view.intercepts.end();) {
         const auto &[group, rules] = *at;
         const auto &taken = self->taken[group];
@@ -194,6 +201,7 @@ void read_group(reading *self, uint8_t group, const std::string &leaf, const std
     group_view &view = self->view.groups[group];
     bool good = true;
     if (leaf == "interface") {
+        // The longest name that Linux allows, without characters that it refuses in one.
         good = text.size() <= 15 && text.find_first_of("/ \t:") == std::string::npos;
         view.interface = good ? text : "";
     } else if (leaf == "policy_grp") {
@@ -207,6 +215,7 @@ void read_group(reading *self, uint8_t group, const std::string &leaf, const std
 }
 
 void read_drain(reading *self, uint8_t group, const std::string &leaf, const std::string &text) {
+    // The instance itself has the state of the drain as its value.
     if (leaf.empty())
         self->view.drains[group] = text != "draining";
 }
@@ -323,6 +332,7 @@ std::map<uint8_t, size_t> count_configured_routers(const std::vector<event_field
         if (!name.is_under(root) || !take_number(name.parts[depth], 0, 255, &group))
             continue;
         size_t &count = out[group];
+        // ROOT/GROUP/admin and ROOT/GROUP/router/NUMBER/ipaddr.
         if (name.parts.size() == depth + 2 && name.parts.back() == "admin")
             down[group] = node.value.text == "down";
         else if (name.parts.size() == depth + 4 && name.parts[depth + 1] == "router" &&
@@ -361,6 +371,7 @@ std::map<uint8_t, group_role> read_group_roles(const std::vector<event_field> &n
         if (leaf == "oper") // "ACTIVE, DESIGNATED"
             out[group].active = node.value.text.starts_with("ACTIVE");
         else if (leaf == "num_appliances")
+            // The number includes this appliance.
             out[group].alone = node.value.text == "0" || node.value.text == "1";
     }
     return out;
@@ -375,6 +386,7 @@ std::map<uint8_t, std::vector<group_router>> read_group_routers(const std::vecto
         const node_name name = parsed_name(node.name);
         uint8_t group = 0;
         uint16_t number = 0;
+        // Beyond the limit, only further nodes of routers that have been taken already.
         if (!name.is_under(root) || name.parts.size() != depth + 4 || name.parts[depth + 1] != "router" ||
             !take_number(name.parts[depth], 0, 255, &group) ||
             !take_number(name.parts[depth + 2], 0, 65535, &number) ||
@@ -392,6 +404,7 @@ std::map<uint8_t, std::vector<group_router>> read_group_routers(const std::vecto
             (void)take_word(text, methods, &router.give_back);
     }
     std::map<uint8_t, std::vector<group_router>> out;
+    // A router without an id has not answered yet.
     for (const auto &[group, routers] : found)
         for (const auto &[number, router] : routers)
             if (router.id)
