@@ -26,6 +26,7 @@ int main(int argc, char **argv) {
                    "index of the first tunnel with --plane table; 4294967295 gives none, which makes an add "
                    "fail");
     CLI11_PARSE(app, argc, argv);
+    // The kernel's GRE links cannot send redirect headers.
     if (user_plane_settings.redirect_header && options.plane == "auto")
         options.plane = "user";
     return run_tunneld(options);

@@ -73,12 +73,15 @@ appliance_view view_appliance(const tunneld &daemon) {
     view.intercepts = daemon.configured.intercepts;
     for (const auto &[group, rules] : view.intercepts) {
         const auto followed = daemon.followed.find(group);
+        // While the program ends, no group counts as draining: `down drop` would drop packets that must be
+        // returned.
         view.conditions[group] = {is_proxy_up(daemon, group, rules), is_active_group(daemon, group),
                                   daemon.configured.drains.contains(group) && daemon.end_at_ms < 0,
                                   followed != daemon.followed.end() && followed->second.decided.overloaded};
     }
     for (const lingering_link &each : daemon.lingering)
         view.lingering.push_back(each.tunnel);
+    // The end of a bypass is a time of day, not of the monotonic clock.
     const int64_t now = time(nullptr);
     for (const bypass_entry &entry : daemon.configured.bypasses)
         if (entry.until == 0 || entry.until > now)
@@ -91,6 +94,8 @@ appliance_view view_appliance(const tunneld &daemon) {
 
 void report_failure(tunneld *daemon, const std::string &error) {
     if (!error.empty()) {
+        // The pause doubles with each failure: the cause may last, and each attempt lists all tables of the
+        // kernel.
         daemon->retry_delay_ms = std::clamp(daemon->retry_delay_ms * 2, RETRY_FIRST_MS, RETRY_MAX_MS);
         daemon->again_at_ms = lt_monotonic_ms() + daemon->retry_delay_ms;
         if (error != daemon->failure)
@@ -130,8 +135,10 @@ void reconcile_now(tunneld *daemon) {
                                                                                  &daemon->indices, &error);
     report_failure(daemon, error);
     const passing_table none;
+    // For the next tunneld. During a take-over the file still has what the earlier one has passed on.
     if (!daemon->takes_over && wanted.passing != (daemon->applied ? daemon->applied->passing : none))
         save_passing(wanted.passing);
+    // Also after a failure: links keep their numbers, by which the next attempt finds them.
     daemon->links = wanted.links;
     daemon->applied = std::move(wanted);
     note_indices(daemon);
@@ -146,8 +153,10 @@ void end_take_over(tunneld *daemon) {
     const auto &groups = daemon->configured.groups;
     const bool has_router = std::any_of(groups.begin(), groups.end(),
                                         [](const auto &group) { return !group.second.routers.empty(); });
+    // Without any group there is no router to wait for.
     if (!has_router && !groups.empty() && lt_monotonic_ms() < daemon->configured_ms + TAKE_OVER_WAIT_MS)
         return;
+    // The next call of reconcile_now() applies everything, even if the wanted state is the same.
     daemon->takes_over = false;
     daemon->applied.reset();
 }
@@ -160,6 +169,7 @@ bool has_ends(const command_desk &desk, const tunnel_ends &ends) {
 
 // `wanted`, or the next lower one that is free; below 0 it wraps around.
 uint16_t find_free_tunnel_id(const command_desk &desk, uint16_t wanted) {
+    // Ends, since there are far fewer tunnels than ids.
     for (uint16_t id = wanted;; id--)
         if (!desk.tunnels.contains(id))
             return id;
@@ -174,6 +184,7 @@ void let_links_linger(tunneld *daemon) {
         const tunnel_ends ends = {link.wish.local, link.wish.remote};
         const bool known = std::any_of(daemon->lingering.begin(), daemon->lingering.end(),
                                        [&](const lingering_link &each) { return each.tunnel.ends == ends; });
+        // Unless a group has been ACTIVE, no router sends anything that could still arrive.
         if (daemon->active_ms >= 0 && link.wish.kind == link_kind::tunnel && !known &&
             !has_ends(daemon->desk, ends))
             daemon->lingering.push_back(
@@ -196,6 +207,7 @@ void follow_health(tunneld *daemon) {
     const auto &states = health_states(daemon->health);
     for (const auto &[group, rules] : daemon->configured.intercepts) {
         const auto state = states.find(group);
+        // A proxy that has not been checked yet neither begins an outage nor ends one.
         if (state == states.end() || state->second.state == proxy_health::unknown)
             continue;
         if (state->second.state == proxy_health::up) {
@@ -210,6 +222,7 @@ void follow_health(tunneld *daemon) {
             continue;
         }
         outage &down = daemon->outages.try_emplace(group, outage{now, false}).first->second;
+        // The operator has changed the intercept while the group was away.
         if (down.left && rules.leave_after_s == 0) {
             LC_LOG(LC_LOG_NOTICE, "Group %d joins its routers again: its leave time is 0 now", group);
             mgmt_link_group_joins(daemon->management, group);
@@ -246,6 +259,7 @@ void proxy_changed(tunneld *daemon, uint8_t group) {
     LC_LOG(up ? LC_LOG_NOTICE : LC_LOG_WARNING, "Group %d: the proxy is %s%s%s", group, up ? "up" : "down",
            up ? "" : ": ", up ? "" : found->second.reason.c_str());
     mgmt_link_proxy_changed(daemon->management, group, up, found->second.reason);
+    // An earlier tunneld may have reported that the group leaves.
     if (up && !daemon->outages.contains(group))
         mgmt_link_group_joins(daemon->management, group);
     follow_health(daemon);
@@ -267,6 +281,7 @@ void take_configuration(tunneld *daemon, const configured_view &view) {
     daemon->configured = view;
     if (daemon->configured_ms < 0)
         daemon->configured_ms = lt_monotonic_ms();
+    // From now on, reconciling the kernel replaces the earlier tunneld's rules.
     end_take_over(daemon);
     daemon->own_addresses = find_own_addresses();
     for (auto it = daemon->outages.begin(); it != daemon->outages.end();) {
@@ -274,6 +289,7 @@ void take_configuration(tunneld *daemon, const configured_view &view) {
             ++it;
             continue;
         }
+        // Without its intercept nothing keeps the group from its routers.
         mgmt_link_group_joins(daemon->management, it->first);
         it = daemon->outages.erase(it);
     }
@@ -297,6 +313,7 @@ void forget_old_roles(tunneld *daemon) {
     const command_desk &desk = daemon->desk;
     if (desk.wccpd_lives && desk.wccpd_pid == daemon->roles_of_pid)
         return;
+    // 0 while no wccpd runs. Its end and the start of the next one are two changes.
     const int32_t pid = desk.wccpd_lives ? desk.wccpd_pid : 0;
     if (daemon->roles_of_pid == pid)
         return;
@@ -324,6 +341,7 @@ void do_periodic_work(tunneld *daemon, int64_t now) {
     end_take_over(daemon);
     if (daemon->desk.options.roles && daemon->desk.attached)
         print_roles(&daemon->desk);
+    // All facts first, then the decisions that depend on them, and the kernel last.
     read_roles(daemon);
     follow_health(daemon);
     daemon->own_addresses = find_own_addresses();
@@ -337,6 +355,7 @@ void do_periodic_work(tunneld *daemon, int64_t now) {
     }
     if (now >= daemon->alive_at_ms && service_watchdog_ms() >= 0) {
         service_report("WATCHDOG=1");
+        // Several times within the limit, so that one late call does not end the program.
         daemon->alive_at_ms = now + service_watchdog_ms() / 4;
     }
 }
@@ -384,6 +403,7 @@ lc_status take_signal(int number, short, void *data, lew *loop) {
     auto *daemon = static_cast<tunneld *>(data);
     const int64_t now = lt_monotonic_ms(), end = find_end_time(daemon, now);
     LC_LOG(LC_LOG_INFO, "Received %s", lc_signal_num_to_name(number));
+    // The second signal ends the program at once.
     if (daemon->end_at_ms >= 0 || end <= now)
         return lew_escape_from_dispatch(loop);
     LC_LOG(LC_LOG_NOTICE, "Routers may still send: their packets are returned for %lld ms",
@@ -411,6 +431,7 @@ std::string missing_privileges() {
 bool choose_plane(tunneld *daemon) {
     std::string reasons;
     for (const data_plane *plane : data_planes) {
+        // The table carries nothing, and is used only on request.
         if (daemon->options.plane == "auto" ? plane == &table_plane : daemon->options.plane != plane->name)
             continue;
         std::string why_not;
@@ -447,12 +468,14 @@ void take_over_kernel_state(tunneld *daemon) {
     for (const wanted_link &link : daemon->links)
         if (link.wish.kind == link_kind::tunnel)
             daemon->desk.tunnels[link.wish.tunnel_id] = {link.wish.local, link.wish.remote, WCCP_NO_INDEX};
+    // Until the configuration has been read, sources that the earlier tunneld has accepted stay accepted.
     for (const wanted_link &link : daemon->links)
         if (const auto beside = daemon->desk.tunnels.find(link.wish.tunnel_id);
             link.wish.kind == link_kind::accepted && beside != daemon->desk.tunnels.end())
             daemon->configured.accepted.push_back({link.wish.remote, beside->second.remote});
     LC_LOG(LC_LOG_NOTICE, "%zu tunnels are taken over", daemon->desk.tunnels.size());
     reconcile_now(daemon);
+    // Only after the links have been made, to which the table refers.
     if (daemon->plane->set_passing)
         daemon->plane->set_passing(load_passing());
 }
@@ -591,6 +614,7 @@ int run_tunneld(const tunneld_options &options) {
     lc_init();
     lc_log_init("tunneld", nullptr, 0, COMPONENT_TUNNELD, LC_LOG_INFO,
                 lc_log_get_facility(nullptr, "tunneld"), 1);
+    // A write to a session that the other side has closed is an error, not the end of the program.
     signal(SIGPIPE, SIG_IGN);
     service_open();
     tunneld daemon;
@@ -600,6 +624,7 @@ int run_tunneld(const tunneld_options &options) {
     bool good = take_process_lock(&lock) && start_parts(&daemon);
     if (good) {
         service_report("READY=1");
+        // The first call sets the timer, which repeats it.
         poll_mailbox(-1, 0, &daemon);
         good = lew_dispatch(daemon.loop, nullptr, nullptr) == LC_OK;
         service_report("STOPPING=1");

@@ -39,6 +39,7 @@ void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorti
     for (const wanted_link &link : daemon.links) {
         const auto index = daemon.indices.find(link.name);
         const auto ordered = daemon.desk.tunnels.find(link.wish.tunnel_id);
+        // Links of deleted tunnels may linger. They are no longer shown.
         if (link.wish.kind != link_kind::tunnel || index == daemon.indices.end() ||
             ordered == daemon.desk.tunnels.end() || ordered->second.local != link.wish.local ||
             ordered->second.remote != link.wish.remote)
@@ -55,6 +56,7 @@ void add_tunnels(const tunneld &daemon, const plane_counters &plane, const sorti
         packet_count ways[SORTED_WAYS];
         uint64_t fragments = 0;
         for (const wanted_link &each : daemon.links) {
+            // The links of other kinds have the id 0, which a tunnel can have as well.
             if (each.wish.tunnel_id != link.wish.tunnel_id || each.wish.kind > link_kind::accepted)
                 continue;
             if (const auto found = plane.links.find(each.name); found != plane.links.end()) {
@@ -90,6 +92,7 @@ void add_intercepts(const tunneld &daemon, const sorting_counters &sorting, std:
     const int64_t now = lt_monotonic_ms();
     std::vector<flow_ends> flows;
     std::string error;
+    // Counted anew: the counts of every second are only taken for groups with a limit or a drain.
     const bool counted = read_transparent_flows(daemon.own_addresses, &flows, &error);
     const auto counts = count_flows(flows, daemon.configured.intercepts);
     for (const auto &[group, rules] : daemon.configured.intercepts) {
@@ -243,6 +246,7 @@ std::vector<state_node> tunneld_state(tunneld *daemon_now) {
     writer.add_count("clamped", sorting.clamped);
     add_refused(&writer, plane.refused);
     std::map<uint32_t, uint64_t> sources = plane.refused_sources;
+    // Only one of the two has any, depending on the plane.
     sources.insert(sorting.refused_sources.begin(), sorting.refused_sources.end());
     for (const auto &[address, packets] : sources)
         writer.add_count("refused_source/" + address_text(address), packets);

@@ -74,6 +74,7 @@ link_numbers number_links(const std::vector<link_wish> &wishes, const std::vecto
         const tunnel_ends ends = {wish.local, wish.remote};
         const numbers_by_ends &before_by_ends = numbers_of(&old, wish);
         const auto known = before_by_ends.find(ends);
+        // insert() also takes the number, for the links that follow.
         if (known == before_by_ends.end())
             while (!used.insert(next).second)
                 next++;
@@ -86,6 +87,7 @@ link_numbers number_links(const std::vector<link_wish> &wishes, const std::vecto
 bool carries_group(const tunnel_ends &tunnel, const group_view &group) {
     if (group.local && group.local != tunnel.local)
         return false;
+    // As long as no router has answered, every tunnel from the group's address may be that of its router.
     if (group.routers.empty())
         return group.local != 0;
     return std::any_of(group.routers.begin(), group.routers.end(),
@@ -143,6 +145,7 @@ std::set<tunnel_ends> passing_ends(const appliance_view &view) {
 std::vector<link_wish> wish_links(const appliance_view &view, bool user_space) {
     std::vector<link_wish> wishes;
     const auto tunnels = all_tunnels(view);
+    // Members first: an accepted source that is also a member gets the member's link only.
     std::set<tunnel_ends> taken = member_ends(view);
     for (const auto &[id, ends] : tunnels)
         if (taken.insert(ends).second)
@@ -183,6 +186,7 @@ std::map<tunnel_ends, tunnel_ends> group_links(const appliance_view &view, const
         for (const auto &source : view.accepted)
             if (source.address && is_accepted_beside(source, tunnel) &&
                 !members.contains({tunnel.local, source.address}))
+                // An address that is a tunnel of its own keeps it: insert() does not replace.
                 links.insert({{tunnel.local, source.address}, tunnel});
     }
     return links;
@@ -201,6 +205,7 @@ struct l2_choice {
 
 void choose_return(const group_view &group, uint32_t router_id, l2_choice *choice) {
     for (const auto &router : group.routers) {
+        // Packets of a router that redirects by L2 do not come by this link.
         if (router.id != router_id || router.forward == travel::l2)
             continue;
         const bool l2 = group.force_l2_return || router.give_back == travel::l2;
@@ -257,6 +262,7 @@ void want_l2_interfaces(const appliance_view &view, const link_numbers &numbers,
         if (!redirects_by_l2(group))
             continue;
         auto &link = interfaces[group.interface];
+        // Several groups can share the interface. The first one with a link decides.
         if (!link)
             link = find_l2_return_link(group, numbers);
     }
@@ -301,6 +307,7 @@ bool find_protected_ports(const appliance_view &view, uint8_t id, bool *out_by_s
         all |= rules.ports.empty();
         out->insert(out->end(), rules.ports.begin(), rules.ports.end());
     }
+    // One intercept of all ports makes the ranges of the others meaningless.
     if (all)
         out->clear();
     return any;
@@ -341,6 +348,7 @@ void want_groups(const appliance_view &view, const link_numbers &numbers, std::v
         out->push_back(std::move(made));
         intercepted.insert(names.begin(), names.end());
     }
+    // Only now is it known which interfaces have intercepted packets.
     for (const auto &[id, names] : others) {
         sorted_group made = {id, {}, {}, names};
         want_pass_marks(view, numbers, &made);
@@ -367,11 +375,14 @@ std::optional<wanted_route> find_member_return(const appliance_view &view, const
             std::find(protection.members.begin(), protection.members.end(), member.remote) ==
                 protection.members.end())
             continue;
+        // The ways in which the group's own packets are returned: from L2 into GRE, by L2, and through a
+        // tunnel's link.
         if (const auto number = find_l2_return_link(group->second, numbers))
             return route_of(*number);
         for (const auto &router : group->second.routers)
             if (router.forward == travel::l2 && router.address && is_interface_name(group->second.interface))
                 return wanted_route{0, false, group->second.interface, router.address};
+        // A link of the tunnel itself, not of one of its accepted sources.
         for (const auto &[ends, tunnel] : group_links(view, group->second, all_tunnels(view)))
             if (ends == tunnel)
                 return route_of(numbers.carrying.at(ends));
@@ -388,6 +399,8 @@ void want_members(const appliance_view &view, const link_numbers &numbers, wante
         const auto number = numbers.carrying.find(ends);
         if (number == numbers.carrying.end())
             continue;
+        // A passing link sends nothing itself: its packets leave by the member's link, whose number its table
+        // has.
         const uint32_t table = TABLE_PASS_FIRST + number->second;
         if (link.wish.kind == link_kind::passing) {
             want_link_basics(link, table, out);
@@ -398,6 +411,7 @@ void want_members(const appliance_view &view, const link_numbers &numbers, wante
         out->rules.push_back({PREFER_RETURN, "", MARK_PASS + number->second, table});
         out->routes.push_back({table, false, link.name, 0});
         if (auto route = find_member_return(view, numbers, ends, *out)) {
+            // The same path, in the table of the member's link.
             route->table = TABLE_LINK_FIRST + number->second;
             out->routes.push_back(*route);
         }
@@ -416,6 +430,7 @@ void want_passing(const appliance_view &view, const link_numbers &numbers, wante
         made.local = group->second.local;
         if (!find_protected_ports(view, id, &made.by_source_port, &made.ports))
             continue;
+        // Without a link, packets of the slot are sorted like all others.
         for (const uint32_t target : protection.targets)
             made.members.push_back(numbers.passing.contains({made.local, target}) ? target : 0);
         if (std::any_of(made.members.begin(), made.members.end(), [](uint32_t one) { return one != 0; }))
@@ -432,10 +447,12 @@ wanted_state make_wanted_state(const appliance_view &view, const std::vector<wan
     if (keep_members)
         keep_member_links(before, &wishes);
     link_numbers numbers = number_links(wishes, before);
+    // Every group has a say in how the packets of its links are returned.
     std::map<tunnel_ends, l2_choice> choices;
     for (const auto &[id, group] : view.groups)
         for (const auto &[ends, tunnel] : group_links(view, group, all_tunnels(view)))
             choose_return(group, tunnel.remote, &choices[ends]);
+    // In the order of the numbers, which does not change when a link is added: the states can be compared.
     std::map<uint32_t, link_wish> by_number;
     for (const auto &wish : wishes)
         by_number[numbers_of(&numbers, wish).at({wish.local, wish.remote})] = wish;
@@ -444,6 +461,7 @@ wanted_state make_wanted_state(const appliance_view &view, const std::vector<wan
         if (wish.kind == link_kind::tunnel || wish.kind == link_kind::accepted)
             want_link(wanted.links.back(), number, choices[{wish.local, wish.remote}], &wanted);
     }
+    // After the tunnels, whose routes those of the members are copied from.
     want_members(view, numbers, &wanted);
     want_l2_interfaces(view, numbers, &wanted);
     if (!wanted.rules.empty()) {
