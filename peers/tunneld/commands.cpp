@@ -91,6 +91,7 @@ bool is_still_pending(const mailbox_command &command) {
 bool answer_command(const mailbox_command &given, uint32_t index, uint32_t status) {
     if (!is_still_pending(given))
         return false;
+    // The outputs come first: wccpd reads them as soon as the status has been set.
     if (given.code != MAILBOX_L2_RETURN)
         wccp_set_fmst_index(index);
     return wccp_set_tunnel_command_status(status);

@@ -17,6 +17,8 @@
 namespace {
 
 constexpr size_t ANSWER_BYTES = 65536;
+// Not SYN_RECV, in which no proxy has accepted the connection yet, and not TIME_WAIT, which belongs to no
+// process.
 constexpr uint32_t STATES = 1u << TCP_ESTABLISHED | 1u << TCP_FIN_WAIT1 | 1u << TCP_FIN_WAIT2 |
                             1u << TCP_CLOSE_WAIT | 1u << TCP_CLOSING | 1u << TCP_LAST_ACK;
 

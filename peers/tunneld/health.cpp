@@ -213,6 +213,7 @@ std::string begin_connection(watched_proxy *self) {
     self->fd = socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (self->fd < 0)
         return std::string("no socket: ") + strerror(errno);
+    // On the loopback interface the connection can be made or refused at once.
     if (connect(self->fd, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0 &&
         errno != EINPROGRESS)
         return describe_socket_error(errno);
@@ -269,6 +270,7 @@ void wait_for_killed(pid_t pid, int pidfd, int64_t deadline_ms) {
 
 std::string begin_command(watched_proxy *self) {
     health_monitor *monitor = self->owner;
+    // Besides one command for each check, the list has those that were killed and have not ended.
     if (monitor->commands.size() >= LINGERING_MAX + monitor->checks.size())
         return "too many earlier checks have not ended";
     pid_t pid = 0;

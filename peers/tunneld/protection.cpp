@@ -33,6 +33,7 @@ void write_kept_file(const char *path, const std::string &text) {
 }
 
 std::string read_kept_file(const char *path) {
+    // The rest of a longer file is ignored, and the line that is cut is left out like a damaged one.
     std::ifstream file(path);
     std::string text(FILE_MAX, '\0');
     file.read(text.data(), static_cast<std::streamsize>(text.size()));

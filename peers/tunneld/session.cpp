@@ -111,6 +111,7 @@ bool send_queries(mgmt_link *link, uint32_t what, const std::vector<std::string>
     owned_request msg;
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK)
         return false;
+    // bn_qf_quiet: the queries are repeated all the time, and wccpd does not log them at level info.
     for (const std::string &node : single_nodes)
         if (bn_query_request_msg_append_str(msg.pointer, bn_query_get, bn_qf_quiet, node.c_str(), nullptr) !=
             LC_OK)

@@ -12,6 +12,7 @@ std::optional<nft_content> held; // the table's content, if this process has mad
 // The declaration of a set or map in the form that sorting_text.cpp writes, up to the types.
 std::string declare_left_set(const std::string &kind, const nlohmann::json &body) {
     std::string types;
+    // nftables lists a single type as a text, and a concatenation as an array.
     const nlohmann::json type = body.value("type", nlohmann::json());
     for (const nlohmann::json &part : type.is_array() ? type : nlohmann::json::array({type}))
         types += (types.empty() ? "" : " . ") + (part.is_string() ? part.get<std::string>() : "");

@@ -301,6 +301,7 @@ void add_class(content_maker &maker, const std::string &name,
         for (const sorted_group *group : groups) {
             if (!wants_something(*group) || group->rules.protocol != protocol)
                 continue;
+            // The groups are in ascending order: the lowest number gets a port that several of them want.
             for (const port_range &range : group->rules.ports)
                 take_ports(&taken, range.first, range.last, group->group);
             if (group->rules.ports.empty())

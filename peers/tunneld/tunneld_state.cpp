@@ -133,6 +133,8 @@ std::map<uint32_t, member_counts> count_members(const tunneld &daemon, const pla
     for (const wanted_link &link : daemon.links) {
         if (link.wish.kind != link_kind::member)
             continue;
+        // What the link has sent was passed on to the member. What has arrived by it was passed on by the
+        // member.
         member_counts &counts = members[link.wish.remote];
         counts.interface = link.name;
         if (const auto found = plane.links.find(link.name); found != plane.links.end())

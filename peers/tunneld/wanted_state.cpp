@@ -232,6 +232,7 @@ void want_link(const wanted_link &link, uint32_t number, const l2_choice &choice
     want_link_basics(link, table, out);
     out->rules.push_back({PREFER_FORWARD, link.name, MARK_FORWARD, RT_TABLE_MAIN});
     wanted_route route = {table, false, link.name, 0};
+    // By L2 the packets leave by the group's own interface, and the link is only their way in.
     if (choice.forced || (choice.agreed && !choice.gre)) {
         const next_hop &hop = choice.forced ? *choice.forced : *choice.agreed;
         route.interface = hop.interface;
