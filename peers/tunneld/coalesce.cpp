@@ -27,7 +27,7 @@ bool has_ports(const uint8_t *packet, size_t length) {
 
 // The length of both headers if the packet can be merged with others, otherwise 0.
 size_t find_mergeable_headers(const coalescer *merger, const uint8_t *packet, size_t length) {
-    // Fragments have been sorted out before. The kernel's receive offload does not merge packets with the
+    // Fragments have been excluded before. The kernel's receive offload does not merge packets with the
     // reserved bit either.
     if (to_host(ip_of(packet)->fragment) & ~IP4_DONT_FRAGMENT)
         return 0;

@@ -19,7 +19,7 @@ bool is_group_empty(course *self, const course_facts &facts) {
     // appliances the table does not change.
     const bool moved =
         facts.left || facts.alone || !facts.active || facts.now_ms - self->draining_ms >= TABLE_CHANGE_MS;
-    // Every flow that is seen in between makes the two counts begin anew.
+    // A flow that is seen in between starts the two counts again.
     if (facts.flows > 0 || !moved)
         self->empty_ms = -1;
     else if (self->empty_ms < 0)

@@ -31,7 +31,7 @@ void read_route(nlmsghdr *message, std::vector<found_route> *out) {
         nlmsg_parse(message, sizeof(rtmsg), attributes, RTA_MAX, nullptr) < 0)
         return;
     const auto *header = static_cast<const rtmsg *>(nlmsg_data(message));
-    // The header has only eight bits for the table's number, like that of rules.
+    // The header has only eight bits for the table's number, as it has for rules.
     const uint32_t table = read_netlink_u32(attributes[RTA_TABLE], header->rtm_table);
     if (header->rtm_protocol != ROUTE_PROTOCOL || header->rtm_family != AF_INET || !is_our_table(table))
         return;
@@ -101,7 +101,7 @@ netlink_message rule_message(int type, int flags, const wanted_rule &rule) {
     fib_rule_hdr header = {};
     header.family = AF_INET;
     header.action = FR_ACT_TO_TBL;
-    // The number of the table does not fit, and is an attribute.
+    // The table's number does not fit into the header and is sent as an attribute.
     header.table = RT_TABLE_UNSPEC;
     auto message = make_netlink_message(type, flags, &header, sizeof header);
     nla_put_u32(message.get(), FRA_TABLE, rule.table);
@@ -148,7 +148,7 @@ int put_route(const wanted_route &route) {
 }
 
 int remove_route(const found_route &found) {
-    // Every attribute that was found: the kernel deletes the first route that matches the given ones.
+    // With every attribute that was found: the kernel deletes the first route that matches those given.
     const auto message = route_message(RTM_DELROUTE, 0, found.route, found.prefix_length, found.type);
     if (found.out_index)
         nla_put_u32(message.get(), RTA_OIF, static_cast<uint32_t>(found.out_index));
@@ -161,7 +161,7 @@ int remove_route(const found_route &found) {
 }
 
 int add_rule(const wanted_rule &rule) {
-    // Without NLM_F_EXCL the kernel would add a second rule that is the same.
+    // Without NLM_F_EXCL the kernel would add an identical second rule.
     const int error = change_kernel(rule_message(RTM_NEWRULE, NLM_F_CREATE | NLM_F_EXCL, rule).get());
     return error == EEXIST ? 0 : error;
 }

@@ -55,7 +55,7 @@ std::optional<setting_path> split_path(const std::string &path) {
 
 bool is_our_path(const std::string &path) {
     const auto parts = split_path(path);
-    // Paths of the state file are written to. One that leads elsewhere is not accepted.
+    // The paths are read from a file and will be written to: one that leads elsewhere is not accepted.
     return parts &&
            (is_interface_name(parts->interface) || parts->interface == "all" ||
             parts->interface == "default") &&
@@ -269,6 +269,6 @@ bool restore_settings(const std::vector<wanted_setting> &wanted, std::string *ou
 }
 
 void disable_ipv6(const std::string &interface) {
-    // Fails on a host without IPv6, which needs nothing.
+    // A host without IPv6 has no such file and needs none.
     write_file("/proc/sys/net/ipv6/conf/" + interface + "/disable_ipv6", 0, "1");
 }

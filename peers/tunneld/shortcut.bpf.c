@@ -68,8 +68,8 @@ int take_shortcut(struct __sk_buff *packet) {
         return TCX_NEXT;
     if (outer.type != bpf_htons(GRE_TYPE_IPV4) && outer.type != bpf_htons(GRE_TYPE_REDIRECT))
         return TCX_NEXT;
-    // Not every router that uses this type sends a redirect header: the first byte of an IP header has other
-    // bits.
+    // Not every router that uses this type sends a redirect header. The first byte of an IP header has other
+    // bits set.
     const int has_redirect =
         outer.type == bpf_htons(GRE_TYPE_REDIRECT) && !(outer.redirect[0] & ~REDIRECT_FLAGS);
     const __u32 before = sizeof outer - (has_redirect ? 0 : sizeof outer.redirect);

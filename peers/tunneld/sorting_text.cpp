@@ -186,7 +186,7 @@ std::string make_pass_rule(content_maker &maker, const sorted_group &group) {
     nft_set &map = maker.set(name, "map { type " + join_fields(group.mask, [](const mask_field &field) {
                                        return field.type;
                                    }) + " : mark; }");
-    // A slot without an element ends the rule at the look-up, and the next rule is tried.
+    // For a slot without an element, the look-up fails and the next rule is tried.
     for (uint32_t slot = 0; slot < group.pass_marks.size(); slot++)
         if (group.pass_marks[slot]) {
             const slot_mask value = slot_value(group.mask, slot);
@@ -228,8 +228,7 @@ void add_group(content_maker &maker, const sorted_group &group) {
         rules.push_back(NOT_JUST_SYN + (" " + ends_as(SORTED_RETURNED, "returned")));
     const intercept_condition &now = group.condition;
     if (now.draining || !now.active || !now.proxy_up) {
-        // `down drop` is about the proxy. While the group is not active, its packets are returned all the
-        // same.
+        // `down drop` concerns the proxy: packets of an inactive group are returned all the same.
         const bool drop = (now.draining || now.active) && wish.drop_when_down;
         rules.push_back(ends_as(SORTED_DOWN, drop ? "down_dropped" : "down"));
         return;
@@ -263,7 +262,7 @@ std::string make_rest_rule(const std::vector<const sorted_group *> &groups) {
     for (const auto &row : ways)
         if (row.rest == rest)
             way = row.way;
-    // With several groups it is not known for which of them to count the packet.
+    // With several groups it is not known whose packet it is, and none of them counts it.
     std::string rule = std::string("goto ") + sorted_words[way];
     if (groups.size() == 1 && wants_something(*groups[0]))
         rule = group_counter(groups[0]->group, way) + " " + rule;

@@ -81,7 +81,7 @@ bool start_ring(const packet_ring *ring, std::string *out_error) {
     any.sll_protocol = htons(ETH_P_IP);
     if (bind(ring->fd, reinterpret_cast<const sockaddr *>(&any), sizeof any) != 0)
         return fail_ring(out_error, "start");
-    // The way of distribution makes no difference to a group of one.
+    // How packets are distributed makes no difference in a group of one socket.
     constexpr unsigned mode = (PACKET_FANOUT_CPU | PACKET_FANOUT_FLAG_DEFRAG | FANOUT_UNIQUE_ID) << 16;
     return set_option(ring->fd, SOL_PACKET, PACKET_FANOUT, mode, "reassembly", out_error);
 }

@@ -53,8 +53,8 @@ bool shortcut_open(packet_shortcut *shortcut, std::string *out_why_not) {
         return fail_shortcut(shortcut, "the program cannot be loaded", out_why_not);
     shortcut->program = bpf_program__fd(bpf_object__find_program_by_name(shortcut->object, "take_shortcut"));
     shortcut->links = bpf_object__find_map_fd_by_name(shortcut->object, "links");
-    // A program that loads may still lack its place: TCX is newer than all that the program uses. Each
-    // network namespace has the device lo.
+    // A kernel that loads the program may still lack TCX, which is newer than everything that the program
+    // uses. Every network namespace has a device lo.
     const int trial = attach_to(*shortcut, if_nametoindex("lo"));
     if (trial < 0)
         return fail_shortcut(shortcut, "the program cannot be attached", out_why_not);
