@@ -405,6 +405,7 @@ protected:
 TEST_F(kernel_state, made_once_followed_and_removed) {
     run_program([] {
         appliance_view view = two_tunnels();
+        protect(&view, false);
         auto wanted = make_wanted_state(view, {}, true);
         reconcile_all(wanted);
         EXPECT_EQ(indices["wccp1"], if_nametoindex("wccp1"));
@@ -417,10 +418,12 @@ TEST_F(kernel_state, made_once_followed_and_removed) {
 
         EXPECT_EQ(count_changes([&] { EXPECT_EQ(reconcile(wanted), ""); }), 0);
 
-        // A tunnel gets another id and L2 return, and the other tunnel is deleted.
+        // A tunnel gets another id and L2 return, the other tunnel is deleted, and flows are no longer passed
+        // on.
         const uint32_t index = indices["wccp0"];
         view.tunnels = {{30, {LOCAL, R1}}};
         view.groups[61].force_l2_return = true;
+        view.protections.clear();
         wanted = make_wanted_state(view, wanted.links, true);
         reconcile_all(wanted);
         EXPECT_EQ(indices, (std::map<std::string, uint32_t>{{"wccp0", index}}));

@@ -22,7 +22,7 @@ std::string name_of_index(int index) {
 }
 
 bool is_our_table(uint32_t table) {
-    return table >= TABLE_LOCAL && table <= TABLE_LINK_FIRST + UINT16_MAX;
+    return table >= TABLE_LOCAL && table <= TABLE_PASS_FIRST + UINT16_MAX;
 }
 
 void read_route(nlmsghdr *message, std::vector<found_route> *out) {
