@@ -404,7 +404,12 @@ TEST_F(Sorting, ChangesAreWholeOrNone) {
         EXPECT_FALSE(apply_sorting_rules(bad, &error));
     }
     EXPECT_EQ(send({}), "answer");
-    apply(wanted);
+    // With another mask, the map of passed-on packets has another type.
+    wanted.groups[0].pass_marks = {0, PASSED_ON};
+    for (const slot_mask mask : {slot_mask{1, 0, 0, 0}, slot_mask{0, 0, 0, 1}, slot_mask{0, 1, 0, 0}}) {
+        wanted.groups[0].mask = mask;
+        apply(wanted);
+    }
     EXPECT_EQ(send({}), "wccp0");
     EXPECT_EQ(counters().groups[5][TO_PROXY].packets, 3);
 

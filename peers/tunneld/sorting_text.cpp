@@ -582,8 +582,16 @@ std::string make_sorting_transaction(const nft_content &before, const nft_conten
         if (!before.known || !wanted || wanted->rules != chain.rules)
             change.add("flush chain", name);
     }
+    // A map whose type changes, as with another mask, is replaced. The rules that use it change as well and
+    // have been flushed. Types of an earlier tunneld have been compared before.
+    const auto kept_set = [&before](const std::string &name, const nft_set &wanted) {
+        const nft_set *old = find_in(before.sets, name);
+        return old && (!before.known || old->declaration == wanted.declaration) ? old : nullptr;
+    };
     for (const auto &[name, set] : after.sets)
-        if (!before.sets.contains(name)) {
+        if (!kept_set(name, set)) {
+            if (const nft_set *old = find_in(before.sets, name))
+                change.add(("delete " + kind_of(*old)).c_str(), name);
             const size_t body = set.declaration.find(' ');
             change.add(("add " + kind_of(set)).c_str(), name, set.declaration.substr(body + 1));
         }
@@ -592,7 +600,7 @@ std::string make_sorting_transaction(const nft_content &before, const nft_conten
         if (!after.sets.contains(name) && !set.filled_by_rules)
             change.add(("flush " + kind_of(set)).c_str(), name);
     for (const auto &[name, set] : after.sets)
-        change_set(change, name, find_in(before.sets, name), set, before.known);
+        change_set(change, name, kept_set(name, set), set, before.known);
     for (const auto &[name, chain] : after.chains) {
         const nft_chain *old = find_in(before.chains, name);
         if (!before.known || !old || old->rules != chain.rules)
