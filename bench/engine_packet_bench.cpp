@@ -109,9 +109,11 @@ void i_see_you(benchmark::State &state, bool digested) {
         pkt->offset = 0;
         pkt->cursor = pkt->data;
         if (digested)
+            // The check of the digest zeroes it in the packet.
             memcpy(pkt->data + 16, digest, sizeof digest);
         wccp_process_received_packet(pkt.get());
     };
+    // The first message settles the views.
     process();
     const uint32_t settled = group->change_number, before = group->rx_icus;
     if (digested)
@@ -127,6 +129,7 @@ void i_see_you(benchmark::State &state, bool digested) {
         measure_with_floor(state, process,
                            [&] { benchmark::DoNotOptimize(read_once(message.data(), message.size())); });
     state.counters["bytes"] = static_cast<double>(message.size());
+    // A message that is refused early would look fast.
     if (group->rx_icus == before || group->rx_icu_failures || wccp_g.rx_failures ||
         group->change_number != settled)
         state.SkipWithError("the message was not processed");
@@ -142,6 +145,7 @@ void build(benchmark::State &state, int (*builder)(wccp_service_group *, wccp_pk
     const auto pkt = std::make_unique<wccp_pkt>();
     int failures = 0;
     const auto write = [&] {
+        // The engine clears its packet before each message, too.
         memset(pkt.get(), 0, sizeof *pkt);
         pkt->cursor = pkt->data;
         failures += builder(group, pkt.get());
@@ -171,6 +175,7 @@ struct reading_log_daemon {
         lc_log_set_daemon_log_level(level);
     }
     ~reading_log_daemon() {
+        // What is still logged while the group is freed doesn't count.
         lc_log_set_daemon_log_level(LC_LOG_EMERG);
         lc_log_close();
         ended = true;
@@ -181,6 +186,7 @@ struct reading_log_daemon {
         char line[4096];
         while (!ended)
             if (poll(&watched, 1, 10) > 0)
+                // As fast as possible: a full socket would slow the engine down.
                 while (recv(daemon.listener, line, sizeof line, MSG_DONTWAIT) > 0)
                     lines++;
     }
@@ -199,6 +205,7 @@ void i_see_you_with_32_changed_weights(benchmark::State &state, int32_t level) {
     for (uint32_t i = 0; i < 32; i++) {
         reported_appliances appliances = {{US, 100}};
         for (uint32_t k = 1; k < 32; k++)
+            // Each router lists 31 appliances of its own, 10.0.(i + 1).x.
             appliances.push_back({host((i + 1) << 8 | (k + 1)), 100});
         reported.see(routers[i], routers, appliances);
     }
@@ -206,6 +213,7 @@ void i_see_you_with_32_changed_weights(benchmark::State &state, int32_t level) {
     const reading_log_daemon log(level);
     wccp_tick(); // elects
     std::vector<std::unique_ptr<wccp_pkt>> messages;
+    // In turn, so that each message changes all weights.
     for (const uint32_t weight : {101u, 100u})
         messages.push_back(make_packet(make_i_see_you(false, 32, weight)));
     const uint32_t key = group->dsg_key_change;
@@ -226,6 +234,7 @@ void i_see_you_with_32_changed_weights(benchmark::State &state, int32_t level) {
     state.counters["best_ms"] = times.front() * 1e3;
     state.counters["median_ms"] = times[times.size() / 2] * 1e3;
     state.counters["lines"] = static_cast<double>(log.lines - lines) / count;
+    // This appliance and 32 times 31 others; a new table for each changed weight.
     if (group->rx_icu_failures || group->appliance_view_count != 993 ||
         group->dsg_key_change != key + 32 * times.size())
         state.SkipWithError("the message was not processed");

@@ -22,6 +22,7 @@ struct configuration {
         for (int i = 0; i < 10000; i++)
             names.push_back("/qv/wccpd/wccp/srv_grp/config/" + std::to_string(i / 40) + "/field/" +
                             std::to_string(i % 40));
+        // Appended out of order, but in the same order in each run.
         std::shuffle(names.begin(), names.end(), std::mt19937(1));
         for (const std::string &name : names) {
             bn_binding *binding = nullptr;

@@ -45,6 +45,7 @@ struct socket_pair {
     void transfer(int from, const void *bytes, size_t length) {
         const auto *at = static_cast<const char *>(bytes);
         while (length) {
+            // One thread does both: a piece that doesn't fit into the socket would block it for ever.
             const size_t piece = length < 65536 ? length : 65536;
             require_true(send(ends[from], at, piece, 0) == static_cast<ssize_t>(piece), "send");
             for (size_t got = 0; got < piece;)
@@ -77,6 +78,7 @@ void measure_with_floor(benchmark::State &state, int64_t messages, int64_t bindi
     const std::string bytes(sent > back ? sent : back, 'b');
     seconds own = 0, floor = 0;
     for (auto _ : state) {
+        // Both in each iteration, so that they share the state of the caches and of the clock.
         const seconds mine = time_of(step);
         floor += time_of([&] {
             pair.transfer(0, bytes.data(), sent);
@@ -137,6 +139,8 @@ struct answered_session : hand_session {
     void answer(const std::string &frames, int64_t messages) {
         answers = 0;
         int idle = 0;
+        // Sends what fits and lets the session read, in turn. Gives up when nothing arrives after the last
+        // byte has been sent.
         for (size_t at = 0; at < frames.size() || (answers < messages && idle < 100);) {
             const ssize_t sent =
                 send(provider.client, frames.data() + at, frames.size() - at, MSG_DONTWAIT | MSG_NOSIGNAL);
@@ -171,6 +175,7 @@ void query_and_answer(benchmark::State &state) {
         sent = static_cast<size_t>(recv(with.provider.client, question.data(), question.size(), 0));
         with.answer(answer, 1);
     };
+    // The first question, outside the measurement, gives the size of the request.
     ask();
     measure_with_floor(state, 2, state.range(0), sent, answer.size(), ask);
 }

@@ -83,6 +83,7 @@ int run_router(char **words) {
     sigset_t ends;
     sigemptyset(&ends);
     sigaddset(&ends, SIGTERM);
+    // Before the plane starts its thread, which inherits the mask: SIGTERM has to wait for sigwait.
     sigprocmask(SIG_BLOCK, &ends, nullptr);
     const link_wish wish = {1, address_of(words[0]), address_of(words[1])};
     if (!user_plane.open(&error) || !user_plane.make_link(words[2], wish, &index, &error)) {
@@ -90,6 +91,7 @@ int run_router(char **words) {
         return 1;
     }
     puts("ready");
+    // The script waits for this line in a file; output to files is buffered.
     fflush(stdout);
     int number = 0;
     sigwait(&ends, &number);
@@ -133,8 +135,10 @@ std::vector<uint8_t> small_frame(uint32_t flow, const uint8_t *mac, uint32_t des
     udp.destination_port = to_be16(DISCARD_PORT);
     udp.length = to_be16(static_cast<uint16_t>(length));
     memcpy(rest.data(), &udp, sizeof udp);
+    // Computed while the field is 0, and copied again with its value.
     udp.checksum = checksum_finish(checksum_add(checksum_pseudo(ip, length), rest.data(), length));
     memcpy(rest.data(), &udp, sizeof udp);
+    // 02:00:00:00:00:01, a locally administered address.
     const uint8_t source_and_type[] = {2, 0, 0, 0, 0, 1, ETH_P_IP >> 8, ETH_P_IP & 255};
     std::vector<uint8_t> frame;
     append(&frame, mac, ETH_ALEN);
@@ -150,6 +154,7 @@ int open_device(const char *device) {
     to.sll_ifindex = static_cast<int>(if_nametoindex(device));
     constexpr int on = 1, buffer = 8 << 20;
     if (fd < 0 || to.sll_ifindex == 0 ||
+        // Packets go straight to the device; a full one is reported as ENOBUFS.
         setsockopt(fd, SOL_PACKET, PACKET_QDISC_BYPASS, &on, sizeof on) != 0 ||
         setsockopt(fd, SOL_SOCKET, SO_SNDBUFFORCE, &buffer, sizeof buffer) != 0 ||
         bind(fd, reinterpret_cast<const sockaddr *>(&to), sizeof to) != 0)
@@ -181,6 +186,7 @@ int run_packets(char **words) {
     double time = began;
     uint64_t sent = 0, refused = 0; // refused: by a full queue of the receiver
     while (time - began < seconds) {
+        // Packets that should have been sent by now. Without a rate a burst is always due.
         const double due = rate > 0 ? (time - began) * rate : static_cast<double>(sent + burst);
         if (due < static_cast<double>(sent + burst)) {
             sleep_for((static_cast<double>(sent + burst) - due) / rate);
@@ -190,6 +196,7 @@ int run_packets(char **words) {
                 if (result <= 0 && errno != ENOBUFS)
                     die(words[0]);
                 refused += result <= 0;
+                // The packet that was refused is skipped, not repeated.
                 done += result <= 0 ? 1 : static_cast<uint32_t>(result);
             }
             sent += burst;
@@ -213,6 +220,7 @@ bool read_connection(int fd, uint64_t *total, uint8_t *buffer) {
     if (got < 0 && (errno == EAGAIN || errno == EINTR))
         return true;
     if (got == 0)
+        // The client checks with it that nothing was lost.
         (void)!send(fd, total, sizeof *total, MSG_NOSIGNAL);
     return false;
 }
@@ -226,6 +234,7 @@ int run_sink(char **words) {
     event.events = EPOLLIN;
     event.data.fd = listener;
     if (setsockopt(listener, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on) != 0 ||
+        // TPROXY delivers connections that are addressed to the server.
         setsockopt(listener, IPPROTO_IP, IP_TRANSPARENT, &on, sizeof on) != 0 ||
         bind(listener, reinterpret_cast<const sockaddr *>(&any), sizeof any) != 0 ||
         listen(listener, 100) != 0 || epoll_ctl(epoll, EPOLL_CTL_ADD, listener, &event) != 0)
@@ -256,6 +265,7 @@ struct progress {
 };
 void note_progress(progress *all, int fd, uint64_t written) {
     int waiting = 0;
+    // Bytes that have not been acknowledged, sent or not.
     if (ioctl(fd, SIOCOUTQ, &waiting) != 0)
         die("SIOCOUTQ");
     const uint64_t acknowledged = written - static_cast<uint64_t>(waiting);
@@ -286,6 +296,7 @@ int run_source(char **words) {
     uint64_t written = 0;
     while ((limit == 0 || now() - began < limit) && (size == 0 || written < size)) {
         const size_t length = size ? std::min<uint64_t>(CHUNK, size - written) : CHUNK;
+        // Without blocking, so that progress is noted even while nothing moves.
         const ssize_t got = send(fd, chunk.data(), length, MSG_DONTWAIT | MSG_NOSIGNAL);
         if (got < 0 && errno != EAGAIN)
             die("send");
@@ -300,6 +311,7 @@ int run_source(char **words) {
     shutdown(fd, SHUT_WR);
     uint64_t total = 0;
     pollfd readable = {fd, POLLIN, 0};
+    // Until the other side has read everything; a pause may be at the very end.
     while (poll(&readable, 1, 10) == 0)
         note_progress(&all, fd, written);
     if (recv(fd, &total, sizeof total, MSG_WAITALL) != sizeof total || total != written)

@@ -86,8 +86,10 @@ int load_program() {
     bpf_insn code[] = {
         copy(PACKET, R1),
         load(R1, PACKET, offsetof(__sk_buff, protocol)),
+        // The offsets of all jumps are filled in below.
         op(BPF_JMP | BPF_JNE | BPF_K, R1, 0, 0, htons(ETH_P_IP)),
         copy(R1, PACKET),
+        // The destination address of the packet.
         set(R2, ETH_HLEN + 16),
         copy(R3, FRAME),
         with(BPF_ADD, R3, -4),
@@ -98,10 +100,12 @@ int load_program() {
         op(BPF_JMP32 | BPF_JNE | BPF_K, R1, 0, 0, word(SERVER)),
         copy(R1, PACKET),
         set(R2, WRAPPING),
+        // Room between the Ethernet header and the packet.
         set(R3, BPF_ADJ_ROOM_MAC),
         set(R4, 0),
         call(BPF_FUNC_skb_adjust_room),
         op(BPF_JMP | BPF_JNE | BPF_K, R0, 0, 0, 0),
+        // Includes the new room by now.
         load(LENGTH, PACKET, offsetof(__sk_buff, len)),
         with(BPF_SUB, LENGTH, ETH_HLEN),
         copy(SUM, LENGTH),
@@ -123,6 +127,7 @@ int load_program() {
         store_half(AT + 10, SUM),
         store(BPF_W, AT + 12, word(ROUTER)),
         store(BPF_W, AT + 16, word(APPLIANCE)),
+        // GRE without options, and the redirect header: dynamic service 51, bucket 0.
         store(BPF_W, AT + 20, word(0x0000883e)),
         store(BPF_W, AT + 24, word(0x80330000)),
         copy(R1, PACKET),
@@ -138,12 +143,14 @@ int load_program() {
     constexpr size_t count = std::size(code);
     for (size_t i = 0; i < count; i++)
         if (code[i].code == (BPF_JMP | BPF_JNE | BPF_K) || code[i].code == (BPF_JMP32 | BPF_JNE | BPF_K))
+            // Relative to the next instruction, to the last but one.
             code[i].off = static_cast<int16_t>(count - 2 - i - 1);
     static char log[65536];
     bpf_attr request = {};
     request.prog_type = BPF_PROG_TYPE_SCHED_CLS;
     request.insns = reinterpret_cast<uintptr_t>(code);
     request.insn_cnt = count;
+    // None of the functions that it calls needs a particular license.
     request.license = reinterpret_cast<uintptr_t>("");
     request.log_buf = reinterpret_cast<uintptr_t>(log);
     request.log_size = sizeof log;
@@ -174,6 +181,7 @@ int main(int argc, char **argv) {
         die("link");
     puts("ready");
     fflush(stdout);
+    // The descriptor of the link is never closed here: the kernel detaches the program when the process ends.
     int number = 0;
     sigwait(&ends, &number);
     return 0;

@@ -91,6 +91,7 @@ void fill_packet(uint8_t *packet, size_t *out_length) {
     if (unshare(CLONE_NEWNET) != 0)
         die("network of the router");
     const int fd = socket(AF_INET, SOCK_RAW | SOCK_NONBLOCK | SOCK_CLOEXEC, IPPROTO_GRE);
+    // The namespace exists now, and the link can be moved into it.
     (void)!write(ready, "", 1);
     uint8_t packet[128];
     size_t length = 0;
@@ -100,11 +101,13 @@ void fill_packet(uint8_t *packet, size_t *out_length) {
     to.sin_addr.s_addr = htonl(APPLIANCE);
     for (;;) {
         uint8_t came[2048];
+        // Everything that waits is read first: an old packet must not count for the next tunnel.
         while (recv(fd, came, sizeof came, 0) > 0)
             if (times->sends && times->returned_at == 0)
                 times->returned_at = seconds_now();
         if (times->sends)
             (void)!sendto(fd, packet, length, 0, reinterpret_cast<const sockaddr *>(&to), sizeof to);
+        // The interval limits how exactly the first packet is timed.
         sleep_for(times->sends ? 0.0002 : 0.001);
     }
 }
@@ -134,6 +137,7 @@ bool run_mailbox_command(uint16_t code, uint16_t id) {
     mailbox->local_ip = APPLIANCE;
     mailbox->remote_ip = ROUTER;
     mailbox->fmst_index = WCCP_NO_INDEX;
+    // Last: the command is valid once its number is there, and tunneld clears it when it has answered.
     mailbox->command = code;
     wccp_wake_tunneld();
     for (const double end = seconds_now() + LIMIT; mailbox->command != 0;) {
@@ -152,6 +156,7 @@ void make_mailbox() {
     if (!mailbox)
         die("mailbox");
     for (wccp_policy_role &role : mailbox->policy_roles)
+        // UNKNOWN.
         role.role = 2;
 }
 
@@ -159,6 +164,7 @@ pid_t start_tunneld(const char *program) {
     const pid_t tunneld = fork();
     if (tunneld == 0) {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
+        // Its output must not be mixed with the results.
         if (!freopen("/dev/null", "w", stdout))
             _exit(1);
         execl(program, program, "--plane", "user", nullptr);
@@ -169,6 +175,7 @@ pid_t start_tunneld(const char *program) {
 void order_and_wait(uint16_t id) {
     times->returned_at = 0;
     times->sends = true;
+    // Packets already arrive when the order is given, as in operation.
     sleep_for(0.002);
     times->returned_at = 0; // nothing is returned while the tunnel does not exist
     const double ordered = seconds_now();
@@ -188,6 +195,7 @@ void order_and_wait(uint16_t id) {
     sleep_for(0.02);
 }
 int run_orders(char **words) {
+    // Shared with the process of the router, which is forked later.
     times = static_cast<shared_times *>(
         mmap(nullptr, sizeof *times, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
     make_mailbox();
@@ -237,6 +245,7 @@ void reconcile_timed(const char *what, const data_plane &plane, const appliance_
     std::vector<wanted_link> found;
     if (takes_over)
         found = find_own_links();
+    // As tunneld does at startup: links that exist are taken over before the state is compared.
     for (const wanted_link &link : found)
         if (!plane.make_link(link.name, link.wish, &indices[link.name], &error))
             die("take over: " + error);
@@ -266,6 +275,7 @@ int run_reconcile(char **words) {
         open();
         reconcile_timed("from nothing", *plane, view, false);
         reconcile_timed("again, all is there", *plane, view, true);
+        // Without cleaning up: the state stays in the kernel, for the next process to find.
         _exit(0);
     }
     int status = -1;

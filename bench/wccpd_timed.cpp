@@ -50,6 +50,7 @@ second count_hold(const hold &given) {
     current.wall += wall;
     current.wall_max = std::max(current.wall_max, wall);
     current.cpu_max = std::max(current.cpu_max, cpu);
+    // The id of the main thread is that of the process.
     if (gettid() == getpid()) {
         current.main_holds++;
         current.main_wall_max = std::max(current.main_wall_max, wall);
@@ -69,6 +70,7 @@ extern "C" int pthread_mutex_lock(pthread_mutex_t *mutex) noexcept {
     static const mutex_function real = find_real_function("pthread_mutex_lock");
     const int result = real(mutex);
     if (mutex == &wccp_g.lock)
+        // After the lock has been acquired: the wait for it is not part of the hold.
         taken = read_clocks();
     return result;
 }
@@ -77,9 +79,12 @@ extern "C" int pthread_mutex_unlock(pthread_mutex_t *mutex) noexcept {
     static const mutex_function real = find_real_function("pthread_mutex_unlock");
     second over = {};
     if (mutex == &wccp_g.lock)
+        // Still with the lock, which guards the figures.
         over = count_hold(read_clocks());
     const int result = real(mutex);
     if (over.holds) {
+        // After the unlock, so that the write is not part of a hold. dprintf is a cancellation point, which
+        // pthread_mutex_unlock must not be.
         const cancel_off_guard uncancelled;
         dprintf(1, "%lld holds %lld mean %lld max %lld cpu %lld us main %lld max %lld cpu %lld us\n",
                 static_cast<long long>(over.number), static_cast<long long>(over.holds),

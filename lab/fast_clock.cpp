@@ -28,6 +28,7 @@ constexpr int64_t LEAST_WAIT = 20 * MILLISECOND;
 int64_t clock_speed() {
     static const int64_t factor = [] {
         const char *text = getenv("FAST_CLOCK");
+        // Without the variable, real time.
         return std::clamp<int64_t>(text ? atoi(text) : 1, 1, 60);
     }();
     return factor;
@@ -50,9 +51,11 @@ timespec from_ns(int64_t ns) {
     return {ns / SECOND, ns % SECOND};
 }
 int64_t shorten_wait(int64_t ns) {
+    // Short waits stay as they are; longer ones never become shorter than LEAST_WAIT.
     return std::max(ns / clock_speed(), std::min(ns, LEAST_WAIT));
 }
 int shorten_wait_ms(int ms) {
+    // Rounded up: a wait of 0 would make a loop spin until its timer is due. Negative times have no limit.
     return ms <= 0 ? ms : static_cast<int>((shorten_wait(ms * MILLISECOND) + MILLISECOND - 1) / MILLISECOND);
 }
 bool is_fast(clockid_t clock) {
@@ -75,6 +78,7 @@ int clock_gettime(clockid_t clock, timespec *out) noexcept {
 int clock_nanosleep(clockid_t clock, int flags, const timespec *time, timespec *left) {
     REAL(clock_nanosleep)
     if (flags & TIMER_ABSTIME) {
+        // The time is on the program's clock; the kernel's runs slower.
         const timespec until = is_fast(clock) ? from_ns(to_ns(*time) / clock_speed()) : *time;
         return real_clock_nanosleep(clock, flags, &until, left);
     }
@@ -87,6 +91,7 @@ int clock_nanosleep(clockid_t clock, int flags, const timespec *time, timespec *
 }
 
 int nanosleep(const timespec *time, timespec *left) {
+    // This library's own function. It returns the error; nanosleep() puts it in errno.
     const int result = clock_nanosleep(CLOCK_MONOTONIC, 0, time, left);
     if (result == 0)
         return 0;
@@ -97,6 +102,7 @@ int nanosleep(const timespec *time, timespec *left) {
 unsigned sleep(unsigned seconds) {
     const timespec time = {seconds, 0};
     timespec left = {};
+    // Rounded up, because the rest of a second is left too.
     return nanosleep(&time, &left) == 0 ? 0 : static_cast<unsigned>(left.tv_sec + 1);
 }
 

@@ -123,6 +123,8 @@ group *find_group(const command_call &call) {
 }
 
 std::vector<address *> owners_of(group *in) {
+    // In the order of the wire, by which `owners` prints and `assign` counts them. A group has either buckets
+    // or values.
     std::vector<address *> owners;
     if (in->current.by == kind::hash)
         for (address &owner : in->current.buckets)
@@ -152,6 +154,7 @@ std::string do_members(const command_call &call) {
         return lines;
     const std::vector<address *> owners = owners_of(in);
     for (const auto &[id, one] : in->members) {
+        // Appliances outside the view are shown by `show` only.
         if (!one.usable)
             continue;
         const auto share = std::count_if(owners.begin(), owners.end(),
@@ -177,6 +180,7 @@ std::string do_assign(const command_call &call) {
 }
 
 std::string do_offer(const command_call &call) {
+    // "none" or any other word offers no method of that kind.
     methods offer = {0, 0, 0};
     uint32_t *const sets[] = {&offer.forward, &offer.assign, &offer.giveback};
     for (size_t i = 0; i < 3; i++) {
@@ -204,6 +208,7 @@ std::string do_fault(const command_call &call) {
     if (times != "always" && (!number || *number > 1000000))
         return "error: not a number of times";
     call.self->fault = name;
+    // Only now, so that a refused command leaves the fault before it in place.
     call.self->fault_left = times == "always" ? -1 : static_cast<int>(*number);
     return "ok";
 }
@@ -228,6 +233,7 @@ std::string do_raw(const command_call &call) {
     } else {
         for (const auto &[number, in] : call.self->groups)
             for (const auto &[id, one] : in.members)
+                // A set, because an appliance that is in several groups gets the bytes once.
                 to.insert(one.source);
     }
     for (const address one : to)

@@ -25,6 +25,7 @@ void set_length(bytes *data, size_t length) {
 constexpr fault FAULTS[] = {
     {"bad-digest", nullptr,
      [](bytes *data, std::string_view) {
+         // The last byte of the digest, if there is one.
          if (data->size() > 31)
              (*data)[31] ^= 1;
      }},
@@ -33,10 +34,12 @@ constexpr fault FAULTS[] = {
     {"bad-length", nullptr,
      [](bytes *data, std::string_view password) {
          set_length(data, data->size() - 8 + 1);
+         // Signed again after each such change, so that the appliance finds the fault and not a wrong digest.
          sign_message(data, password);
      }},
     {"cut", nullptr,
      [](bytes *data, std::string_view password) {
+         // The message has the right length, but its last component ends too early.
          data->resize(data->size() - 6);
          set_length(data, data->size() - 8);
          sign_message(data, password);
@@ -52,6 +55,7 @@ constexpr fault FAULTS[] = {
     {"many-components", [](i_see_you *message, std::string *) { add_unknown(message, 4); }, nullptr},
     {"routers-33",
      [](i_see_you *message, std::string *) {
+         // 10.99.0.N: addresses that no router of the lab has.
          while (message->routers.size() < MOST_IN_VIEW + 1)
              message->routers.push_back(0x0a630000 + static_cast<address>(message->routers.size()));
      },
@@ -83,6 +87,7 @@ constexpr fault FAULTS[] = {
     {"other-format",
      [](i_see_you *message, std::string *) {
          for (view_element &element : message->appliances)
+             // Only an element in mask format with redirected packets exists in both sizes.
              element.is_short = element.flags == 2 && !element.is_short;
      },
      nullptr},

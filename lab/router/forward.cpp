@@ -55,9 +55,11 @@ bool read_packet(const uint8_t *data, size_t size, packet_fields *fields) {
         return false;
     const size_t header = 4U * (data[0] & 15);
     const size_t total = read_u16(data + 2);
+    // More bytes than the total length are padding of the link.
     if (header < 20 || total < header || total > size)
         return false;
     *fields = {read_u32(data + 12), read_u32(data + 16), 0, 0, data[9], total};
+    // Only the first fragment has the ports.
     const bool first = (read_u16(data + 6) & 0x1fff) == 0;
     if (first && (data[9] == TCP || data[9] == UDP) && total >= header + 4) {
         fields->src_port = read_u16(data + header);
@@ -78,6 +80,7 @@ bool matches_service(const service_info &service, const packet_fields &packet) {
     if (!(service.flags & HAS_PORTS))
         return true;
     const uint16_t port = service.flags & PORTS_ARE_SOURCES ? packet.src_port : packet.dst_port;
+    // Unused places in the list of ports are 0.
     return port != 0 && std::find(service.ports.begin(), service.ports.end(), port) != service.ports.end();
 }
 
@@ -96,6 +99,7 @@ uint8_t bucket_of(const service_info &service, const packet_fields &packet) {
     mix(BY_DST_IP, packet.dst);
     mix(BY_SRC_PORT, packet.src_port);
     mix(BY_DST_PORT, packet.dst_port);
+    // The upper bits of a product depend on all bits of its factors.
     return static_cast<uint8_t>(mixed >> 56);
 }
 
@@ -104,6 +108,7 @@ address owner_by_mask(const std::vector<mask_set> &sets, const packet_fields &pa
         const mask_fields wanted = {packet.src & set.mask.src_ip, packet.dst & set.mask.dst_ip,
                                     static_cast<uint16_t>(packet.src_port & set.mask.src_port),
                                     static_cast<uint16_t>(packet.dst_port & set.mask.dst_port)};
+        // The values of a set are already masked.
         for (const mask_value &value : set.values)
             if (value.match == wanted)
                 return value.owner;
@@ -121,6 +126,7 @@ verdict ask_group(const group &in, const packet_fields &packet) {
         found.owner = owner_by_mask(in.current.sets, packet);
     }
     const auto place = in.members.find(found.owner);
+    // An owner that has left: the packet is routed, as without an owner.
     if (place == in.members.end() || !place->second.usable)
         found.owner = 0;
     else
@@ -147,6 +153,7 @@ bytes gre_header(const router &self, const verdict &found) {
     if (form == "plain")
         return header;
     const service_info &service = found.in->service;
+    // The redirect header: flags, service, alternative bucket, bucket.
     header.insert(header.end(),
                   {service.type == 0 ? uint8_t{0} : DYNAMIC_SERVICE, service.id, 0, found.bucket});
     return header;
@@ -171,12 +178,15 @@ int open_tun(const std::string &interface, std::string *wrong) {
     ifreq wish = {};
     snprintf(wish.ifr_name, sizeof wish.ifr_name, "to-%s", interface.c_str());
     wish.ifr_flags = IFF_TUN | IFF_NO_PI;
+    // Any socket will do: the interface is named in the request.
     const int control = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
     // The device, with the routes through it, outlives this program.
     if (fd < 0 || ioctl(fd, TUNSETIFF, &wish) != 0 || ioctl(fd, TUNSETPERSIST, 1) != 0 ||
         ioctl(control, SIOCGIFFLAGS, &wish) != 0 ||
         (wish.ifr_flags |= IFF_UP, ioctl(control, SIOCSIFFLAGS, &wish) != 0))
         *wrong = std::string("to-") + interface + ": " + strerror(errno);
+    // The kernel queues packets in the device until this program reads them; bursts of many clients need
+    // room.
     wish.ifr_qlen = 4000;
     (void)ioctl(control, SIOCSIFTXQLEN, &wish);
     close(control);
@@ -188,6 +198,8 @@ int open_gre(address own, std::string *wrong) {
     sockaddr_in place = {};
     place.sin_family = AF_INET;
     place.sin_addr.s_addr = htonl(own);
+    // Redirected packets of full size don't fit with their new headers; the kernel fragments them, as a
+    // router does.
     const int fragments = IP_PMTUDISC_DONT, room = 8 << 20, one = 1;
     // The interface with the address may be created later.
     if (fd < 0 || setsockopt(fd, IPPROTO_IP, IP_FREEBIND, &one, sizeof one) != 0 ||
@@ -204,6 +216,7 @@ int open_gre(address own, std::string *wrong) {
 bool read_redirecting(const std::string &text, redirecting *out) {
     const size_t equals = text.find('=');
     out->interface = text.substr(0, equals);
+    // "to-", the name and a NUL have to fit.
     if (equals == std::string::npos || out->interface.empty() || out->interface.size() > IFNAMSIZ - 4)
         return false;
     std::istringstream in(text.substr(equals + 1));
@@ -253,6 +266,7 @@ const sockaddr_ll *find_neighbour(address who) {
         return place.sll_halen ? &place : nullptr;
     looked_up = now;
     place = {};
+    // The messages of the protocol keep the kernel's entry alive, so that no ARP request has to be sent here.
     std::ifstream table("/proc/net/arp");
     std::string line, own, kind, flags, mac, mask, device;
     while (std::getline(table, line)) {
@@ -309,6 +323,7 @@ void redirect_packet(const forwarder &path, const redirecting &from, const uint8
     traffic &counted = path.self->traffic;
     packet_fields packet;
     const bool sound = read_packet(data, size, &packet);
+    // A stopped router still routes: only the protocol and the redirection have ended.
     const verdict found =
         sound && !path.self->stopped ? find_owner(*path.self, from.services, packet) : verdict{};
     if (found.owner == 0) {
@@ -337,6 +352,7 @@ bool is_member(const router &self, address who) {
 void accept_return(const forwarder &path, const uint8_t *data, size_t size) {
     traffic &counted = path.self->traffic;
     packet_fields outer, inner;
+    // A raw socket delivers the outer header too, and reassembled packets.
     const size_t header = size > 0 ? 4U * (data[0] & 15) : 0;
     if (!read_packet(data, size, &outer) || !is_member(*path.self, outer.src)) {
         counted.refused_returns++;
@@ -352,6 +368,7 @@ void accept_return(const forwarder &path, const uint8_t *data, size_t size) {
     one.returned++;
     if (read_u16(gre + 2) == GRE_REDIRECTED)
         one.returned_redirected++;
+    // Any of the devices will do: packets from all of them are routed and not redirected again.
     (void)write(path.from.front().tun, gre + begins, inner.length);
 }
 

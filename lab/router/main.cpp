@@ -81,6 +81,7 @@ void open_station(station *one) {
         return;
     one->multicast = open_socket(options.group);
     const in_addr self = {htonl(options.self)};
+    // Messages to the group are received on the other socket and sent from this router's own address.
     const ip_mreq membership = {{htonl(options.group)}, self};
     const uint8_t ttl = 5, off = 0;
     if (setsockopt(one->multicast, IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof membership) != 0 ||
@@ -111,6 +112,7 @@ void receive_from(const lab_process &all, station *one, int fd, address to) {
         sockaddr_in name = {};
         socklen_t length = sizeof name;
         const ssize_t got = recvfrom(fd, data, sizeof data, 0, reinterpret_cast<sockaddr *>(&name), &length);
+        // The sockets don't block: everything that has arrived is read.
         if (got < 0)
             return;
         output out;
@@ -138,6 +140,7 @@ std::string run_command(lab_process *all, const std::string &line) {
         const std::string answer = router_command(&one.machine, seconds_now() - all->began, words, &out);
         send_output(*all, &one, out);
         answers += answer + "\n";
+        // The other routers would give the same error.
         if (answer.starts_with("error:"))
             return answer + "\n";
     }
@@ -148,6 +151,7 @@ void serve_control(lab_process *all, int listener) {
     const int fd = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
     if (fd < 0)
         return;
+    // The routers wait while a command is served; a client that hangs may not stop them for long.
     const timeval limit = {1, 0};
     setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
     setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
@@ -191,6 +195,8 @@ void run_loop(lab_process *all, int control) {
         for (const int fd : forwarder_descriptors(all->path))
             fds.push_back({fd, POLLIN, 0});
     for (;;) {
+        // Signals are blocked, so that poll isn't interrupted and always sets `revents`. Descriptors of -1
+        // are ignored.
         (void)poll(fds.data(), fds.size(), TICK_MS);
         if (fds[0].revents) {
             signalfd_siginfo info;
@@ -207,6 +213,7 @@ void run_loop(lab_process *all, int control) {
             char part[512];
             const ssize_t got = read(STDIN_FILENO, part, sizeof part);
             if (got <= 0)
+                // At the end of standard input the router continues without it.
                 fds[2].fd = -1;
             else
                 typed.append(part, static_cast<size_t>(got));
@@ -224,6 +231,7 @@ void run_loop(lab_process *all, int control) {
             if (fds[4 + 2 * i].revents)
                 receive_from(*all, &one, one.multicast, one.machine.options.group);
             output out;
+            // In each round, at least every TICK_MS.
             router_tick(&one.machine, seconds_now() - all->began, &out);
             send_output(*all, &one, out);
         }
@@ -249,6 +257,7 @@ void open_path(lab_process *all, const std::vector<std::string> &redirect) {
         fputs("wccp_router: --redirect needs exactly one --router\n", stderr);
         exit(2);
     }
+    // The vector doesn't grow any more: the pointer stays valid.
     all->path.self = &all->stations.front().machine;
     all->path.self->forwards = true;
     const std::string wrong = open_forwarder(&all->path);
@@ -372,6 +381,7 @@ int main(int argc, char **argv) {
             fprintf(stderr, "wccp_router: %s is not an address\n", text.c_str());
             return 2;
         }
+        // The other options are the same for all routers.
         options.self = *self;
         station one;
         one.machine.options = options;

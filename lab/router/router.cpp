@@ -65,6 +65,7 @@ std::vector<address> list_reported_routers(const router &self, const group &in) 
     for (const auto &[id, one] : in.members)
         if (one.usable)
             all.insert(one.routers.begin(), one.routers.end());
+    // This router is always the first, and only once.
     all.erase(self.options.self);
     std::vector<address> view = {self.options.self};
     for (const address router : all)
@@ -81,6 +82,7 @@ void refresh_router_view(router *self, group *in, double now, output *out) {
         return;
     const bool first = in->router_view.empty();
     in->router_view = std::move(view);
+    // The initial view is not a change.
     if (first)
         return;
     in->change_number++;
@@ -107,6 +109,8 @@ view_element element_of(const router &self, const group &in, const member &one) 
     element.id = one.id;
     element.weight = one.weight;
     if (one.chosen.assign == 2) {
+        // Routers of the two formats differ in the element of an appliance that gets packets by mask: 16
+        // bytes, or the long form with its masks.
         const bool redirected = in.current.by == kind::mask && count_values(in, one.id) > 0;
         element.flags = redirected ? 2 : 3;
         element.is_short = redirected && !self.options.nexus;
@@ -123,6 +127,7 @@ view_element element_of(const router &self, const group &in, const member &one) 
 uint32_t next_receive_id(const router &self, group *in, member *to, address where, double now) {
     const uint32_t id = ++in->receive_id;
     for (auto &[key, one] : in->members) {
+        // A multicast message is also received by the other members of the multicast group.
         if (&one != to && !(where == self.options.group && one.by_group))
             continue;
         one.sent_ids.push_back(id);
@@ -146,7 +151,10 @@ void send_i_see_you(router *self, group *in, member *to, double now, output *out
     message.service = in->service;
     message.router = self->options.self;
     message.receive_id = next_receive_id(*self, in, to, where, now);
+    // The destination of the appliance's own message, by which it recognizes the answer.
     message.sent_to = to->by_group ? self->options.group : self->options.self;
+    // All appliances that are heard, also those that are not in the view yet: a new one waits to see itself
+    // here.
     for (const auto &[id, one] : in->members)
         message.received_from.push_back(id);
     message.change_number = in->change_number;
@@ -158,6 +166,7 @@ void send_i_see_you(router *self, group *in, member *to, double now, output *out
             message.appliances.push_back(element_of(*self, *in, one));
     if (in->current.by == kind::mask)
         message.map = in->current.sets;
+    // Without a Capabilities component GRE and hash assignment are meant.
     if (!(self->options.offer == methods{}))
         message.offer = self->options.offer;
     if (command != 0)
@@ -175,6 +184,7 @@ void send_i_see_you(router *self, group *in, member *to, double now, output *out
     std::string fault;
     if (self->fault_left != 0) {
         fault = self->fault;
+        // A negative number means every message.
         if (self->fault_left > 0)
             self->fault_left--;
         spoil_message(fault, &message, &password);
@@ -216,6 +226,7 @@ void drop_member(router *self, group *in, address id, double now, const char *wh
         return;
     const bool was_usable = place->second.usable;
     in->members.erase(place);
+    // The others never saw it: nothing has changed for them.
     if (!was_usable)
         return;
     for (address &owner : in->current.buckets)
@@ -226,6 +237,7 @@ void drop_member(router *self, group *in, address id, double now, const char *wh
             if (value.owner == id)
                 value.owner = 0;
     in->change_number++;
+    // The next appliance may define another service.
     if (usable_count(*in) == 0) {
         in->current = {};
         in->defined = false;
@@ -246,6 +258,7 @@ std::string find_objection(const router &self, const group &in, const service_in
                            const here_i_am &hello) {
     const methods &offer = self.options.offer;
     const methods &chosen = hello.chosen;
+    // An appliance chooses exactly one method of each kind.
     if (chosen.forward < 1 || chosen.forward > 2 || !(offer.forward & chosen.forward))
         return "forwarding method not offered";
     if (chosen.assign < 1 || chosen.assign > 2 || !(offer.assign & chosen.assign))
@@ -287,6 +300,7 @@ const char *accept_hello(router *self, group *in, member *one, const incoming &m
     if (!one->refused.empty()) {
         const std::string why = one->refused;
         if (one->usable) {
+            // drop_member() erases the record. The appliance stays known, so that it still gets answers.
             const member kept = *one;
             drop_member(self, in, hello.id, now, why.c_str(), out);
             member &again = in->members[hello.id] = kept;
@@ -303,6 +317,7 @@ const char *accept_hello(router *self, group *in, member *one, const incoming &m
     for (const router_mark &mark : hello.routers)
         one->routers.push_back(mark.router);
     const bool first = !agreed_methods(*in, hello.id);
+    // The only member has changed its methods: its table is of the old kind.
     if (first && one->usable && !(one->chosen == hello.chosen))
         in->current = {};
     one->chosen = hello.chosen;
@@ -345,6 +360,7 @@ void receive_hello(router *self, group *in, const incoming &message, double now,
     one.id = hello.id;
     one.source = from;
     one.by_group = self->options.group != 0 && to == self->options.group;
+    // An appliance outside the view is kept as long as it sends; in the view only echoes count.
     if (!one.usable)
         one.heard_at = now;
     const char *echo = check_echo(*self, one, hello);
@@ -354,13 +370,16 @@ void receive_hello(router *self, group *in, const incoming &message, double now,
         event["result"] = "shutdown";
         out->events.push_back(event);
         count_event(self, "rx_shutdown");
+        // A copy, because the record is erased before the answer is sent.
         member leaving = one;
         drop_member(self, in, hello.id, now, "shutdown", out);
         send_i_see_you(self, in, &leaving, now, out, COMMAND_SHUTDOWN_SEEN);
         return;
     }
+    // The message comes first in the log, before the changes that it causes.
     const size_t place = out->events.size();
     const char *result = accept_hello(self, in, &one, message, echo, now, out);
+    // `one` may be invalid: accept_hello() drops and adds members.
     member &kept = in->members[hello.id];
     event["result"] = kept.refused.empty() ? std::string(result) : "refused: " + kept.refused;
     out->events.insert(out->events.begin() + static_cast<std::ptrdiff_t>(place), event);
@@ -371,6 +390,7 @@ void receive_hello(router *self, group *in, const incoming &message, double now,
 
 std::string judge_assignment(const router &self, const group &in, const redirect_assign &assign, address from,
                              double now) {
+    // The key is the address of the designated appliance.
     const auto sender = in.members.find(assign.key);
     if (sender == in.members.end() || !sender->second.usable || sender->second.source != from)
         return "not from a member";
@@ -415,6 +435,7 @@ void adopt_assignment(group *in, const redirect_assign &assign) {
     } else {
         for (size_t i = 0; i < BUCKETS; i++)
             if (assign.buckets[i] != NO_APPLIANCE)
+                // The index was checked when the message was read.
                 fresh.buckets[i] = owner_if_usable(*in, assign.appliances[assign.buckets[i]]);
     }
     in->current = std::move(fresh);
@@ -491,11 +512,13 @@ void router_tick(router *self, double now, output *out) {
         std::vector<address> silent;
         for (auto &[id, one] : in.members) {
             const double silence = now - one.heard_at;
+            // A member is asked before it is dropped, even if both times have passed in one tick.
             if (silence >= self->options.drop_after && (one.queried || !one.usable))
                 silent.push_back(id);
             else if (silence >= self->options.query_after && one.usable && !one.queried)
                 send_query(self, &in, &one, now, out);
         }
+        // After the loop, which iterates over the members.
         for (const address id : silent)
             drop_member(self, &in, id, now, "silent", out);
     }

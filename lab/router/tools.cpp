@@ -24,6 +24,7 @@ bool fill_address(const std::string &path, sockaddr_un *place) {
         errno = ENAMETOOLONG;
         return false;
     }
+    // The NUL is there already.
     memcpy(place->sun_path, path.c_str(), path.size());
     return true;
 }
@@ -37,6 +38,7 @@ int listen_at(const std::string &path) {
     const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     if (fd < 0)
         return -1;
+    // A socket of an earlier run.
     unlink(path.c_str());
     if (bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0 || listen(fd, 16) != 0) {
         close(fd);
@@ -57,6 +59,7 @@ int run_logd(const std::string &file) {
         return 1;
     }
     struct sigaction action = {};
+    // Without SA_RESTART, so that a signal ends recv.
     action.sa_handler = [](int) { ended = 1; };
     sigaction(SIGTERM, &action, nullptr);
     sigaction(SIGINT, &action, nullptr);
@@ -66,6 +69,7 @@ int run_logd(const std::string &file) {
         ssize_t length = recv(fd, line, sizeof line - 1, 0);
         if (length < 0 && errno != EINTR)
             break;
+        // Programs end their datagrams with a newline, a NUL, or neither.
         while (length > 0 && (line[length - 1] == '\n' || line[length - 1] == '\0'))
             length--;
         if (length <= 0)
@@ -89,6 +93,7 @@ int run_ctl(const std::string &socket_path, const std::string &command) {
     const std::string line = command + "\n";
     if (send(fd, line.data(), line.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(line.size()))
         return 2;
+    // The router answers after a line or the end of the input.
     shutdown(fd, SHUT_WR);
     char part[4096];
     std::string answer;

@@ -72,6 +72,7 @@ bool send_all(int fd, const char *data, size_t size) {
 bool send_body(int fd, uint64_t size) {
     for (uint64_t at = 0; at < size;) {
         const size_t piece = static_cast<size_t>(std::min<uint64_t>(PIECE, size - at));
+        // The content repeats, so that one prepared piece serves all offsets.
         if (!send_all(fd, body_content().data() + at % 251, piece))
             return false;
         at += piece;
@@ -98,6 +99,7 @@ bool read_more(stream *in) {
             pause_for(static_cast<double>(got) / in->rate);
         return true;
     }
+    // With SO_RCVTIMEO, EAGAIN means that the time is over.
     in->wrong = got == 0 ? "closed" : errno == EAGAIN ? "timeout" : errno == ECONNRESET ? "reset" : "read";
     return false;
 }
@@ -111,6 +113,7 @@ bool read_head(stream *in, std::string *head) {
         if (!read_more(in))
             return false;
     }
+    // With the line end of the last header, so that all of them end alike.
     *head = in->waiting.substr(0, end + 2);
     in->waiting.erase(0, end + 4);
     return true;
@@ -154,6 +157,7 @@ void serve_connection(int fd, address peer) {
         const bool upload = head.starts_with("POST ");
         uint64_t size = 0;
         if (upload) {
+            // Some clients wait for this before they send the body.
             if (strcasecmp(header_of(head, "Expect").c_str(), "100-continue") == 0)
                 (void)send_all(fd, "HTTP/1.1 100 Continue\r\n\r\n", 25);
             if (!read_body(&in, number_in(header_of(head, "Content-Length"))))
@@ -177,6 +181,7 @@ void accept_connections(int listener) {
         socklen_t length = sizeof peer;
         const int fd = accept4(listener, reinterpret_cast<sockaddr *>(&peer), &length, SOCK_CLOEXEC);
         if (fd >= 0)
+            // Nobody waits for it: the thread ends with its connection, which has a time limit.
             std::thread(serve_connection, fd, ntohl(peer.sin_addr.s_addr)).detach();
     }
 }
@@ -219,6 +224,7 @@ const char *connect_from(int fd, const fetch_options &options, uint32_t source) 
     sockaddr_in place = {};
     place.sin_family = AF_INET;
     if (!options.from.empty()) {
+        // Port 0: the kernel chooses one.
         place.sin_addr.s_addr = htonl(address_of(options.from).value_or(0) + source);
         if (bind(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) != 0)
             return "bind";
@@ -227,6 +233,7 @@ const char *connect_from(int fd, const fetch_options &options, uint32_t source) 
     place.sin_addr.s_addr = htonl(address_of(options.server).value_or(0));
     if (connect(fd, reinterpret_cast<const sockaddr *>(&place), sizeof place) == 0)
         return nullptr;
+    // SO_SNDTIMEO limits connect as well, which then fails with EINPROGRESS.
     return errno == EINPROGRESS ? "connect timeout" : errno == ECONNREFUSED ? "refused" : "connect";
 }
 std::string make_request(const fetch_options &options) {
@@ -239,6 +246,7 @@ std::string make_request(const fetch_options &options) {
 const char *exchange_request(stream *in, const std::string &request, const fetch_options &options,
                              fetched *out) {
     std::string head;
+    // For the two sends, which don't set a reason.
     in->wrong = "send";
     if (!send_all(in->fd, request.data(), request.size()) || !send_body(in->fd, options.upload) ||
         !read_head(in, &head))
@@ -260,6 +268,7 @@ fetched fetch_once(const fetch_options &options, uint32_t source) {
     const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     set_limits(fd, options.timeout);
     const int small = 32768; // makes the sender wait for a slow reader
+    // Before connect, where the window scale is agreed.
     if (options.rate > 0)
         setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &small, sizeof small);
     one.wrong = connect_from(fd, options, source);
@@ -284,6 +293,7 @@ struct tally {
 };
 void fetch_many(const fetch_options &options, double began, tally *all) {
     for (;;) {
+        // Each thread takes the next number; the order of the fetches doesn't matter.
         const uint32_t number = all->next++;
         if (options.seconds > 0 ? wall_seconds() - began >= options.seconds : number >= options.count)
             return;
@@ -364,8 +374,10 @@ bool ask_again(connection_pool *all, long_connection *one, uint64_t last_answer)
     all->answers++;
     all->slowest = std::max(all->slowest, wall_seconds() - began);
     one->proxy = answer.proxy;
+    // Reported with the first answer, which names the proxy.
     if (one->answers++ == 0)
         print_event("opened", *one, asked, nullptr);
+    // A connection whose end the server has announced is not broken.
     if (!answer.last && one->answers < last_answer)
         return true;
     all->ended++;
@@ -377,16 +389,19 @@ void run_connection(connection_pool *all, long_connection *one) {
     const double phase = static_cast<double>(one->number) / all->options.long_lived;
     uint64_t last_answer = all->aging ? all->options.life : UINT64_MAX;
     while (!is_over(*all)) {
+        // The ends of the open connections are spread over `life` seconds.
         if (all->aging && last_answer == UINT64_MAX)
             last_answer = one->answers + 1 + one->number % all->options.life;
         if (!ask_again(all, one, last_answer))
             return;
         const double now = wall_seconds();
+        // Until this connection's place in the next second.
         usleep(static_cast<useconds_t>((std::floor(now - phase) + 1 + phase - now) * 1e6));
     }
 }
 void keep_connected(connection_pool *all, uint32_t number) {
     const fetch_options &options = all->options;
+    // The connections are opened over a second, too.
     usleep(number * 1'000'000U / options.long_lived);
     while (!is_over(*all)) {
         long_connection one = {number, {socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0), "", ""}, 0, ""};
@@ -413,6 +428,7 @@ int keep_all_connected(const fetch_options &options) {
     sigemptyset(&signals);
     for (const int number : {SIGTERM, SIGINT, SIGUSR1})
         sigaddset(&signals, number);
+    // The threads inherit the mask: only this thread takes the signals.
     pthread_sigmask(SIG_BLOCK, &signals, nullptr);
     std::vector<std::thread> workers;
     for (uint32_t number = 0; number < options.long_lived; number++)

@@ -34,6 +34,7 @@ constexpr size_t DIGEST_OFFSET = HEADER_BYTES + 8;
 
 std::array<uint8_t, MD5_DIGEST_BYTES> digest_of(const bytes &message, std::string_view password) {
     uint8_t secret[PASSWORD_BYTES] = {};
+    // The digest covers the password, padded with zeros to 8 bytes, and the message with a digest of zeros.
     memcpy(secret, password.data(), std::min(password.size(), PASSWORD_BYTES));
     bytes blank = message;
     std::fill_n(blank.begin() + DIGEST_OFFSET, MD5_DIGEST_BYTES, uint8_t{0});
@@ -73,6 +74,7 @@ struct reader {
     // The number of entries of `each` bytes; an error if they do not fit into the remaining bytes.
     uint32_t count(size_t each, const char *what) {
         const uint32_t value = u32(what);
+        // By division, because a product could overflow.
         if (missed.empty() && value > left / each)
             missed = std::string(what) + " of " + std::to_string(value) + " does not fit";
         return missed.empty() ? value : 0;
@@ -93,6 +95,7 @@ mask_fields read_mask(reader *in) {
 }
 
 void read_sets(reader *in, std::vector<mask_set> *sets) {
+    // 12 bytes of mask and a count of values, which may be 0.
     const uint32_t elements = in->count(16, "mask count");
     for (uint32_t i = 0; i < elements && in->missed.empty(); i++) {
         mask_set set;
@@ -135,6 +138,7 @@ void read_identity(reader *in, incoming *message) {
     if (hello.mask_format) {
         std::vector<mask_set> sets;
         read_sets(in, &sets);
+        // Values and buckets are not used: the router knows them from the assignment.
         if (!sets.empty())
             hello.mask = sets.front().mask;
     } else if (in->want(BUCKETS / 8, "buckets")) {
@@ -197,6 +201,7 @@ void read_mask_assignment(reader *in, incoming *message) {
     if (in->u16("assignment type") != 1 && in->missed.empty())
         in->missed = "assignment type is not 1";
     const uint16_t length = in->u16("assignment length");
+    // The assignment has a header of its own inside the component.
     if (in->missed.empty() && length != in->left)
         in->missed = "assignment length is not that of the component";
     read_assignment(in, message);
@@ -226,6 +231,7 @@ std::string read_security(const bytes &data, std::string_view password, reader *
         return in->missed;
     if (type != SECURITY_INFO)
         return "the first component is not Security Info";
+    // Option 0: no password. Option 1: an MD5 digest follows.
     if (length != (option == 1 ? 4 + MD5_DIGEST_BYTES : 4))
         return "length of the Security Info";
     if ((option == 1) != !password.empty())
@@ -233,6 +239,7 @@ std::string read_security(const bytes &data, std::string_view password, reader *
     if (option == 1) {
         if (!in->want(MD5_DIGEST_BYTES, "digest"))
             return in->missed;
+        // Checked before anything else in the message is trusted.
         const auto wanted = digest_of(data, password);
         if (!std::equal(wanted.begin(), wanted.end(), in->place))
             return "wrong digest";
@@ -289,6 +296,7 @@ std::string read_message(const bytes &data, std::string_view password, incoming 
             return in.missed;
         reader inside = {in.place, size, ""};
         in.skip(size);
+        // Unknown components are skipped.
         for (const component_reader &row : COMPONENT_READERS) {
             if (row.message != message->type || row.type != type)
                 continue;
@@ -305,6 +313,7 @@ std::string read_message(const bytes &data, std::string_view password, incoming 
     for (const component_reader &row : COMPONENT_READERS)
         if (row.message == message->type && row.needed && !(seen & 1U << row.type))
             return std::string("no ") + row.name;
+    // Each kind is optional in the table, but one of them is needed.
     if (message->type == REDIRECT_ASSIGN && seen != 1U << ASSIGNMENT && seen != 1U << MASK_ASSIGNMENT)
         return "not exactly one assignment";
     return "";
@@ -369,6 +378,7 @@ void write_element(writer *to, const view_element &element) {
     to->u32(element.id);
     to->u16(element.revision);
     to->u16(element.flags);
+    // The size of an element depends on its flags, and in mask format on the count of masks.
     if (!(element.flags & 2)) {
         to->add(element.buckets.data(), element.buckets.size());
     } else if (element.is_short) {
@@ -383,6 +393,7 @@ void write_element(writer *to, const view_element &element) {
 }
 
 bytes finish_message(writer *to, std::string_view password) {
+    // The length of the message is in the two bytes before its contents, like that of a component.
     to->end(HEADER_BYTES);
     sign_message(&to->out, password);
     return std::move(to->out);
@@ -391,6 +402,7 @@ bytes finish_message(writer *to, std::string_view password) {
 } // namespace
 
 void sign_message(bytes *message, std::string_view password) {
+    // The byte before the digest is the last one of the security option.
     if (message->size() < DIGEST_OFFSET + MD5_DIGEST_BYTES || (*message)[DIGEST_OFFSET - 1] != 1)
         return;
     const auto digest = digest_of(*message, password);

@@ -44,16 +44,19 @@ wccpd_plan plan_for_wccpd(const node_tree &before, const node_tree &after, const
             whole.insert(name);
     for (const node_change &change : commit.changes)
         if (const node_name unit = find_unit(change.name); is_group(unit))
+            // The root changes only when the group is created or deleted.
             if (change.name == unit || !can_follow(change))
                 whole.insert(unit);
     wccpd_plan plan;
     for (const node_name &root : whole) {
+        // A new group has no nodes in `before`, and a deleted one has none in `after`.
         append_group(before.nodes, root, false, &plan.events[0]);
         append_group(after.nodes, root, true, &plan.events[2]);
         if (before.nodes.contains(root) && after.nodes.contains(root))
             plan.recreated.push_back(root);
     }
     for (const node_change &change : commit.changes)
+        // Changes outside groups are always here: their unit is the node itself.
         if (!whole.contains(find_unit(change.name)))
             plan.events[1].push_back(change);
     return plan;
@@ -77,6 +80,7 @@ cut_into_events(const std::vector<const node_change *> &changes) {
     node_name unit;
     for (const node_change *change : changes) {
         const node_name next = find_unit(change->name);
+        // The nodes of a group are adjacent, because the changes are in the order of the tree.
         if (out.empty() || (size >= EVENT_BYTES && next != unit)) {
             out.emplace_back();
             size = 0;

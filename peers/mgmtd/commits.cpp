@@ -55,6 +55,7 @@ bn_request_msg *make_event_for(const server *self, uint32_t peer_id, const event
         return make_change_event(event);
     change_list hidden;
     event_changes shown;
+    // `shown` points into `hidden`, which must therefore not be reallocated.
     hidden.reserve(event.size());
     for (const node_change *change : event) {
         hidden.push_back(*change);
@@ -68,8 +69,11 @@ bn_request_msg *make_event_for(const server *self, uint32_t peer_id, const event
 
 void send_change_events(server *self, const node_tree &before, const commit_result &commit) {
     wccpd_plan plan = plan_for_wccpd(before, self->tree, commit);
+    // After the plan: which groups are recreated depends on the configured values, not on those of an
+    // overlay.
     for (change_list &changes : plan.events)
         server_adapt_for_wccpd(self, &changes);
+    // The events point to changes in `plan` and `commit`, which outlive them.
     std::vector<std::pair<uint32_t, event_changes>> events;
     bool recreates = false;
     for (const auto &[id, who] : self->peers) {
@@ -82,6 +86,7 @@ void send_change_events(server *self, const node_tree &before, const commit_resu
     }
     if (recreates)
         for (const node_name &root : plan.recreated)
+            // Logged only if a wccpd is connected: the group loses its routers for a moment.
             self->say("service group " + root.parts.back() + " is deleted and created again in wccpd");
     for (const auto &[id, event] : events) {
         const owned_request msg(make_event_for(self, id, event));
@@ -122,6 +127,7 @@ void write_facility(const server *self) {
     std::string reason, content = "system " + read_facility(self->tree) + "\n";
     bool good = read_whole_file(self->facility_file, &before, &reason);
     std::istringstream lines(before.value_or(""));
+    // All other lines are kept, and several "system" lines become one.
     for (std::string line; std::getline(lines, line);)
         if (!line.starts_with("system "))
             content += line + "\n";
@@ -129,6 +135,7 @@ void write_facility(const server *self) {
         std::error_code ignored; // if this fails, the write fails as well and gives the reason
         std::filesystem::create_directories(std::filesystem::path(self->facility_file).parent_path(),
                                             ignored);
+        // Unlike the configuration, this file is read by programs of other users.
         good = replace_file(self->facility_file, content, 0644, nullptr, &reason);
     }
     if (!good)
@@ -167,6 +174,8 @@ commit_result refuse_commit(uint32_t code, const std::string &reason) {
 
 commit_result prepare_commit(server *self, const std::vector<set_step> &steps, const commit_order &order,
                              node_tree *out_next) {
+    // Checked first: with another base, the other errors would be about a configuration that the client has
+    // not seen.
     if (order.revision && order.revision != self->tree.revision)
         return refuse_commit(LC_ASSERTION, "The configuration has changed meanwhile (commit " +
                                                std::to_string(self->tree.revision) + "): read it again");
@@ -176,12 +185,16 @@ commit_result prepare_commit(server *self, const std::vector<set_step> &steps, c
         return result;
     if (!check_commit(self, *out_next, &reason))
         return refuse_commit(LC_ASSERTION, reason);
+    // A commit without changes succeeds even while another one waits, and gets no revision and no file.
     if (out_next->set == self->tree.set && result.renewed.empty()) {
         out_next->revision = self->tree.revision;
         return result;
     }
+    // A check-only commit is refused as well: its answer has to be that of the commit.
     if (reason = server_wait_for_confirmation(self); !reason.empty() && !order.ends_wait)
         return refuse_commit(LC_ASSERTION, reason);
+    // A commit may have no changes here: setting a node to its default writes it to the file and changes no
+    // value.
     const commit_extent extent = {result.changes.size(),
                                   result.changes.empty() ? result.renewed.data() : &result.changes[0].name};
     if (!order.check_only && !server_save(self, *out_next, self->comments, order, extent, &reason))
@@ -226,6 +239,7 @@ int64_t server_expire_bypasses(server *self) {
     static const node_name pattern = parsed_name(NODE_BYPASS_CONFIG "/*/until");
     static const node_name root = parsed_name(NODE_BYPASS_CONFIG);
     const int64_t now = self->now_ms();
+    // The walk below is only made when it can find something.
     if (self->expire_at_ms < 0 || now < self->expire_at_ms)
         return self->expire_at_ms;
     const int64_t clock = self->clock_s();
@@ -233,8 +247,10 @@ int64_t server_expire_bypasses(server *self) {
     int64_t wait_ms = -1;
     for (auto at = self->tree.nodes.upper_bound(root);
          at != self->tree.nodes.end() && at->first.is_under(root); ++at) {
+        // 0 stands for a node that is not a time as well as for a bypass without an end.
         const int64_t until = matches_pattern(pattern, at->first) ? std::stoll(at->second.text) : 0;
         if (until != 0 && until <= clock)
+            // The whole bypass is removed, not only its `until`: without that it would last forever.
             over.push_back(
                 {set_kind::remove, root.below(at->first.parts[root.parts.size()]).text(), bn_type_none, ""});
         else if (until != 0)
@@ -245,6 +261,7 @@ int64_t server_expire_bypasses(server *self) {
                       {"mgmtd (bypasses whose time is over)", "mgmtd", "bypasses whose time is over"})
                 .code != 0)
         wait_ms = CLOCK_LOOK_MS; // refused, perhaps because the disk is full: try again later
+    // A successful commit has set the time to 0 meanwhile. All remaining bypasses have been examined already.
     return self->expire_at_ms = wait_ms < 0 ? -1 : now + wait_ms;
 }
 
@@ -265,8 +282,11 @@ bool server_load(server *self, std::string *out_errors, std::string *out_warning
     const bool good = config_load(&self->file, &text);
     *out_errors = text.errors;
     if (good)
+        // At startup these are only warnings: the address of an interface may have changed since the commit,
+        // and mgmtd has to start all the same.
         append_complaints(self, text, find_bad_routers(text.tree, nullptr, self->local_addresses()),
                           out_warnings);
+    // Taken over in spite of errors: the caller ends the program then.
     self->tree = std::move(text.tree);
     self->comments = std::move(text.comments);
     return good;
@@ -275,6 +295,7 @@ bool server_load(server *self, std::string *out_errors, std::string *out_warning
 void server_begin(server *self) {
     if (!self->file.path.empty() && remove_unfinished_file(self->file.path))
         self->say("removed the leftover of an interrupted commit beside " + self->file.path);
+    // The mode matters even before the first commit, because the file may contain passwords.
     if (const std::string open = config_protect(self->file.path); !open.empty())
         self->say(open);
     write_facility(self);
@@ -290,11 +311,13 @@ bool read_file_again(server *self, config_text *out, std::string *out_warnings) 
         out->errors = self->file.path + ": " + strerror(errno) + "\n";
         return false;
     }
+    // A copy: if the new content is refused, `seen` keeps the old one, and no commit can overwrite the edit.
     config_file file = self->file;
     if (!config_load(&file, out))
         return false;
     const std::vector<local_address> local = self->local_addresses();
     std::string reason;
+    // Bad routers are errors where the edit changes a group, and warnings in the others.
     append_complaints(self, *out, find_bad_routers(out->tree, &self->tree, local), &out->errors);
     if (!tree_check_change(self->tree, out->tree, &reason))
         out->errors += config_complaint(file.path, out->lines, reason);
@@ -321,12 +344,14 @@ bool keep_reload(server *self, const config_text &read, const std::vector<node_c
 void server_reload(server *self) {
     config_text text;
     std::string warnings, reason;
+    // Restored if the history refuses the edit, which then counts as unread.
     const config_file before = self->file;
     if (!read_file_again(self, &text, &warnings)) {
         self->say("configuration not read again:\n" + text.errors);
         return;
     }
     const commit_result commit = {0, "", tree_difference(self->tree.nodes, text.tree.nodes), {}};
+    // An edit of comments or of the layout is not a commit.
     text.tree.revision = self->tree.revision + (commit.changes.empty() ? 0 : 1);
     if (!keep_reload(self, text, commit.changes, &reason)) {
         self->file = before;

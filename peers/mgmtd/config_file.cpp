@@ -12,6 +12,7 @@
 
 bool config_load(config_file *file, config_text *out) {
     std::string reason;
+    // `seen` changes only if the content is accepted: what was not understood must not be overwritten.
     if (std::optional<std::string> content; !read_whole_file(file->path, &content, &reason)) {
         out->errors = file->path + ": " + reason + "\n";
     } else if (config_parse(content.value_or(""), file->path, out)) {
@@ -38,6 +39,7 @@ bool is_as_seen(const config_file &file, std::string *out_reason) {
 
 bool reads_the_same(const std::string &written, const node_tree &tree, std::string *out_reason) {
     config_text again;
+    // A name or value that the format can't express would otherwise be lost, and the next start would fail.
     if (config_parse(written, "what was written", &again) && again.tree.set == tree.set)
         return true;
     *out_reason = "the written text would not be read as the same configuration";
@@ -51,6 +53,8 @@ bool reads_the_same(const std::string &written, const node_tree &tree, std::stri
 bool config_save(config_file *file, const node_tree &tree, const config_comments &comments,
                  std::string *out_reason) {
     const std::string content = config_format(tree, comments);
+    // The edit check runs last, just before the rename, to keep the time in which an edit could be lost
+    // short.
     const bool saved = replace_file(
         file->path, content, S_IRUSR | S_IWUSR,
         [&](const std::string &written, std::string *out) {
@@ -66,6 +70,7 @@ bool config_save(config_file *file, const node_tree &tree, const config_comments
 
 std::string config_protect(const std::string &path) {
     // By a descriptor, because the path may name another file by the time the mode is changed.
+    // O_NONBLOCK because the open of a pipe would wait for a writer.
     const int fd = open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
     struct stat about;
     std::string out;

@@ -41,6 +41,7 @@ bool read_number_field(const std::vector<event_field> &fields, const char *name,
 
 void report_drain(server *self, uint8_t group, const std::string &state) {
     node_value &report = self->state[name_drain_report(group)];
+    // The action may be repeated to change the time. Watchers get the event again, the log one line.
     if (report.text != state)
         self->say(describe_group(group) + ": " + state);
     report = {bn_type_str, state};
@@ -53,6 +54,7 @@ void report_drain(server *self, uint8_t group, const std::string &state) {
 }
 
 void leave_routers(server *self, uint8_t group, const char *state) {
+    // Read before the change, so that wccpd gets only the difference.
     const group_overlay before = server_overlay_of(self, group);
     self->drains[group].left = true;
     server_send_overlay(self, group, before);
@@ -67,9 +69,11 @@ void forget_drain(server *self, uint8_t group) {
 // --- Actions
 
 void begin_drain(server *self, uint8_t group, uint32_t seconds) {
+    // Read before the drain exists, because the overlay depends on it.
     const group_overlay before = server_overlay_of(self, group);
     const bool fresh = !self->drains.contains(group);
     drain_request &drain = self->drains[group];
+    // The group has left already; a new time would have no effect.
     if (drain.left)
         return;
     drain.until_ms = self->now_ms() + int64_t{seconds} * 1000;
@@ -87,6 +91,7 @@ uint32_t find_drain_groups(const server *self, const std::vector<event_field> &f
                            std::vector<uint8_t> *out, std::string *out_message) {
     uint32_t group = 0;
     if (!find_field(fields, "group")) {
+        // Groups that are down have no flows to wait for.
         for (uint32_t each = 0; each < 256; each++)
             if (const std::string *admin = find_configured_admin(self, static_cast<uint8_t>(each));
                 admin && *admin == "up")
@@ -120,6 +125,8 @@ uint32_t server_begin_drain(server *self, const std::vector<event_field> &fields
         *out_message = "seconds is not a number between 0 and " + std::to_string(SECONDS_MAX);
         return LC_BAD_ARGUMENT;
     }
+    // Only a group that was named can be down here. An appliance without groups has nothing to drain, and
+    // that is not an error.
     if (groups.size() == 1 && *find_configured_admin(self, groups[0]) != "up") {
         *out_message = "Group " + std::to_string(groups[0]) + " is down, there is nothing to drain";
         return LC_BAD_ARGUMENT;
@@ -164,11 +171,13 @@ void server_take_drain_progress(server *self, uint32_t peer_id, const std::vecto
     if (!server_read_reported_group(self, peer_id, fields, &group) ||
         !read_number_field(fields, "flows", bn_type_uint32, &flows) || !empty)
         return;
+    // tunneld's report may cross the cancellation of the drain.
     const auto drain = self->drains.find(group);
     if (drain == self->drains.end())
         return;
     drain->second.flows = flows;
     self->state[name_drain_report(group).below("flows")] = {bn_type_uint32, std::to_string(flows)};
+    // A group that has left with flows is still counted, and becomes "drained" when the last one ends.
     if (*empty == "true" && (!drain->second.left || self->state[name_drain_report(group)].text == "over"))
         leave_routers(self, group, "drained");
 }
@@ -180,12 +189,15 @@ void server_take_weight(server *self, uint32_t peer_id, const std::vector<event_
         !read_number_field(fields, "percent", bn_type_uint32, &percent) || percent == 0 || percent > 100)
         return;
     const group_overlay before = server_overlay_of(self, group);
+    // The record is updated even if the percentage is the same: after a restart of tunneld the reporter
+    // differs.
     const auto known = self->slowed.find(group);
     const uint32_t last = known == self->slowed.end() ? 100 : known->second.percent;
     if (percent < 100)
         self->slowed[group] = {percent, peer_id, 0};
     else
         self->slowed.erase(group);
+    // tunneld repeats its reports with each configuration.
     if (percent == last)
         return;
     self->say(describe_group(group) + " announces " + std::to_string(percent) + " % of its weight");
@@ -203,6 +215,7 @@ void server_orphan_weights(server *self, uint32_t peer_id) {
 
 void server_forget_deleted_drains(server *self) {
     std::erase_if(self->slowed, [&](const auto &each) { return !find_configured_admin(self, each.first); });
+    // The iterator advances first, because forgetting a drain erases its element.
     for (auto at = self->drains.begin(); at != self->drains.end();) {
         const uint8_t group = (at++)->first;
         if (!find_configured_admin(self, group))
@@ -217,6 +230,7 @@ int64_t server_end_drains(server *self) {
     int64_t next = -1;
     for (const auto &[group, drain] : self->drains) {
         if (!drain.left && now >= drain.until_ms)
+            // If tunneld has never counted the flows, they are taken to exist.
             leave_routers(self, group, drain.flows == 0 ? "drained" : "over");
         else if (!drain.left)
             keep_earlier(&next, drain.until_ms);
@@ -227,6 +241,7 @@ int64_t server_end_drains(server *self) {
         const int64_t due = slowed.orphaned_ms + LEFT_KEEP_MS;
         const bool wanted =
             self->tree.nodes.contains(parsed_name(NODE_INTERCEPT_CONFIG).below(std::to_string(group)));
+        // A tunneld that has a session again reports the weight itself.
         if (slowed.reporter != 0 || (followed && wanted))
             continue;
         if (wanted && now < due) {

@@ -32,6 +32,7 @@ struct unfinished_file {
     std::string path;
     bool renamed = false;
     explicit unfinished_file(const std::string &target) : path(target + ".unfinished") {
+        // A leftover of a killed process would make O_EXCL fail.
         unlink(path.c_str());
     }
     unfinished_file(const unfinished_file &) = delete;
@@ -56,10 +57,13 @@ std::string find_directory_of(const std::string &path) {
 bool follow_links(const std::string &path, std::string *out, std::string *out_reason) {
     *out = path;
     for (int i = 0; i < LINKS_MAX; i++) {
+        // Only the last component: the kernel follows links in the directories before it.
         char bytes[PATH_MAX];
         const ssize_t length = readlink(out->c_str(), bytes, sizeof bytes);
         if (length < 0)
+            // EINVAL: it is not a link. ENOENT: it doesn't exist yet.
             return errno == EINVAL || errno == ENOENT || fail_with_errno(out_reason);
+        // readlink adds no NUL.
         const std::string target(bytes, static_cast<size_t>(length));
         *out = target[0] == '/' ? target : find_directory_of(*out) + "/" + target;
     }
@@ -112,12 +116,15 @@ bool write_all(int fd, const std::string &content) {
         if (wrote > 0)
             done += static_cast<size_t>(wrote);
     }
+    // Before the rename, or a loss of power could leave the new name with an empty file.
     return fsync(fd) == 0;
 }
 
 void sync_directory(const std::string &file) {
     const owned_fd directory(open(find_directory_of(file).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (directory.fd >= 0)
+        // A failure can't be acted upon: the rename has happened, and some file systems don't sync
+        // directories.
         (void)fsync(directory.fd);
 }
 
@@ -138,6 +145,7 @@ bool replace_file(const std::string &path, const std::string &content, mode_t mo
     unfinished_file fresh(target);
     const owned_fd file(
         open(fresh.path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR));
+    // fchmod makes the mode independent of the umask. The content is read back from the same descriptor.
     if (file.fd < 0 || fchmod(file.fd, mode) != 0 || !write_all(file.fd, content) ||
         lseek(file.fd, 0, SEEK_SET) != 0 || !read_all(file.fd, &written))
         return fail_with_errno(out_reason);

@@ -44,6 +44,7 @@ std::string entry_path(const history &self, uint32_t number) {
 
 template <typename Number>
 bool parse_number(const std::string &text, Number *out) {
+    // from_chars stops at the first other character; the whole text has to be a number.
     const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), *out);
     return error == std::errc() && end == text.data() + text.size() && !text.empty();
 }
@@ -70,6 +71,7 @@ std::string format_entry(const history_entry &entry, const std::string &text) {
 bool parse_entry(const std::string &content, history_entry *out, std::string *out_text) {
     std::map<std::string, std::string> words;
     size_t at = 0;
+    // An empty line ends the description. A file that doesn't begin with a note has none.
     for (size_t end; content.starts_with(CONFIG_NOTE) && (end = content.find('\n', at)) != std::string::npos;
          at = end + 1) {
         std::istringstream line(content.substr(at, end - at));
@@ -83,9 +85,11 @@ bool parse_entry(const std::string &content, history_entry *out, std::string *ou
         words[word] = value;
     }
     *out = {};
+    // A word that is missing is an empty text here, and an error below if it has to be a number.
     out->user = words["user"];
     out->cause = words["cause"];
     out->what = words["what"];
+    // Files of confirmed commits don't have the two lines.
     const bool waits = words.contains("returns-to");
     if (!parse_number(words["commit"], &out->number) || !parse_number(words["time"], &out->time_s) ||
         !parse_number(words["changes"], &out->changes) ||
@@ -93,6 +97,7 @@ bool parse_entry(const std::string &content, history_entry *out, std::string *ou
                    !parse_number(words["confirm-by"], &out->confirm_by_s))) ||
         at >= content.size())
         return false;
+    // `at` is the newline of the empty line.
     *out_text = content.substr(at + 1);
     return true;
 }
@@ -124,6 +129,7 @@ void read_entries(history *self, const std::function<void(const std::string &lin
         std::string text, reason;
         if (!name.starts_with(FILE_PREFIX) || !parse_number(name.substr(FILE_PREFIX.size()), &number))
             continue;
+        // A copy under another number would let a rollback restore the wrong configuration.
         if (read_entry(at->path(), &entry, &text, &reason) && entry.number == number)
             self->entries.push_back(std::move(entry));
         else
@@ -136,11 +142,14 @@ void read_entries(history *self, const std::function<void(const std::string &lin
 void settle_pending(history *self, const std::string &content,
                     const std::function<void(const std::string &line)> &say) {
     const std::string pending = pending_path(*self);
+    // Of a commit that was interrupted while "pending" was being written: it was never made.
     (void)remove_unfinished_file(pending);
     history_entry entry;
     std::string text, reason;
     if (access(pending.c_str(), F_OK) != 0)
         return;
+    // The texts differ if the configuration file was not replaced, or was edited afterwards. An edit becomes
+    // a commit of its own.
     if (read_entry(pending, &entry, &text, &reason) && text == content &&
         (self->entries.empty() || entry.number > self->entries.back().number)) {
         if (history_finish(self, entry, &reason))
@@ -177,6 +186,7 @@ bool history_prepare(const history &self, const history_entry &entry, const std:
                      std::string *out_reason) {
     if (self.directory.empty())
         return true;
+    // Commits contain passwords; therefore the directory is mgmtd's alone.
     if (mkdir(self.directory.c_str(), S_IRWXU) != 0 && errno != EEXIST)
         return fail_in_directory(self, out_reason);
     if (replace_file(pending_path(self), format_entry(entry, text), S_IRUSR | S_IWUSR, nullptr, out_reason))

@@ -26,6 +26,7 @@ const history_entry *waiting_commit(const server *self) {
     if (self->kept.entries.empty())
         return nullptr;
     const history_entry &last = self->kept.entries.back();
+    // The numbers differ if a later commit could not be kept. The configuration to return from is gone then.
     return last.returns_to != 0 && last.number == self->tree.revision ? &last : nullptr;
 }
 
@@ -68,6 +69,8 @@ bool kept_text(const server *self, const node_name &name, bool hide, std::string
         return false;
     if (!hide)
         return true;
+    // Passwords can only be found in the nodes, so that the text is parsed and written again. If that fails,
+    // the text is not shown at all.
     const bool good = config_parse_part(*out, "", &text);
     *out = hidden_text(text.tree);
     return good;
@@ -113,6 +116,8 @@ history_entry make_entry(const server *self, uint32_t number, const commit_order
 bool server_keep(server *self, const node_tree &next, const config_comments &comments,
                  const commit_order &order, commit_extent extent, std::string *out_reason) {
     const history_entry entry = make_entry(self, next.revision, order, extent);
+    // The same two steps as for a commit of mgmtd: if it is killed in between, the next start finishes the
+    // second.
     return history_prepare(self->kept, entry, config_format(next, comments), out_reason) &&
            history_finish(&self->kept, entry, out_reason);
 }
@@ -133,6 +138,7 @@ bool server_save(server *self, const node_tree &next, const config_comments &com
     if (self->file.path.empty())
         return true;
     const history_entry entry = make_entry(self, next.revision, order, extent);
+    // The history may lack the present configuration, for example because the disk was full at startup.
     if (!keep_present(self, "found", out_reason) ||
         !history_prepare(self->kept, entry, config_format(next, comments), out_reason))
         return false;
@@ -143,6 +149,7 @@ bool server_save(server *self, const node_tree &next, const config_comments &com
     // The configuration file has been replaced. Whatever fails from here on, the commit is made.
     if (std::string reason; !history_finish(&self->kept, entry, &reason))
         self->say("commit " + std::to_string(entry.number) + " is not kept: " + reason);
+    // This commit may wait itself, with another time.
     self->return_at_ms = -1;
     return true;
 }
@@ -156,6 +163,7 @@ void server_open_history(server *self) {
     std::string text, reason;
     config_text last;
     if (!self->kept.entries.empty()) {
+        // The numbers continue. If the file was edited while mgmtd did not run, the edit is the next commit.
         self->tree.revision = self->kept.entries.back().number;
         if (!history_text(self->kept, self->tree.revision, &text, &reason) ||
             !config_parse(text, "", &last) || last.tree.set != self->tree.set)
@@ -238,9 +246,11 @@ int64_t server_return_unconfirmed(server *self) {
     const history_entry *waiting = waiting_commit(self);
     if (!waiting)
         return self->return_at_ms = -1;
+    // A copy: the commit that undoes it is appended to the vector that `waiting` points into.
     const history_entry entry = *waiting;
     const int64_t now = self->now_ms();
     if (self->return_at_ms < 0) {
+        // Computed once after the commit or a restart. From then on changes of the wall clock have no effect.
         const int64_t left = entry.confirm_by_s - self->clock_s(), most = entry.confirm_by_s - entry.time_s;
         self->return_at_ms = now + std::clamp<int64_t>(left, 0, std::max<int64_t>(most, 0)) * 1000;
     }

@@ -64,6 +64,7 @@ std::string read_leave_reason(const std::vector<event_field> &fields) {
 }
 
 void end_leave(server *self, uint8_t group, const std::string &why) {
+    // Read before the erase, so that wccpd gets only the difference.
     const group_overlay before = server_overlay_of(self, group);
     if (self->left.erase(group) == 0)
         return;
@@ -81,6 +82,8 @@ void server_take_leave(server *self, uint32_t peer_id, const std::vector<event_f
         !has_group_node(self, NODE_GROUP_CONFIG, group))
         return;
     const group_overlay before = server_overlay_of(self, group);
+    // tunneld repeats its reports. The record is renewed each time, because the reporter may be a new session
+    // and the reason another one.
     const bool first = !self->left.contains(group);
     self->left[group] = {peer_id, 0};
     const node_name report = name_leave_report(group);
@@ -122,6 +125,7 @@ void server_orphan_left_groups(server *self, uint32_t peer_id) {
 
 void server_forget_deleted_groups(server *self) {
     for (auto at = self->left.begin(); at != self->left.end();) {
+        // The iterator advances before the element is erased.
         const auto [group, left] = *at++;
         if (has_group_node(self, NODE_GROUP_CONFIG, group))
             continue;

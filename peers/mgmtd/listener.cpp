@@ -62,6 +62,8 @@ bool lock_alone(int fd, const std::string &path, std::string *out_error) {
 bool take_lock_file(listener *self, std::string *out_error) {
     if (geteuid() != 0)
         return true; // /var/run is root's
+    // The file is never removed: an mgmtd that had just opened it would lock a file that the next one no
+    // longer finds.
     self->lock = open(MGMTD_LOCK_FILE, O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600);
     if (self->lock < 0)
         return fail_with_errno(out_error, MGMTD_LOCK_FILE);
@@ -73,6 +75,7 @@ bool take_lock_file(listener *self, std::string *out_error) {
 bool move_aside(const listener *self, const std::string &path, uid_t owner, std::string *out_error) {
     for (int i = 1; i <= MOVES_MAX; i++) {
         const std::string aside = path + ".moved-" + std::to_string(i);
+        // A plain rename could replace something that was moved aside earlier.
         if (renameat2(AT_FDCWD, path.c_str(), AT_FDCWD, aside.c_str(), RENAME_NOREPLACE) == 0) {
             self->say(path + " belonged to user " + std::to_string(owner) + ", moved to " + aside);
             return true;
@@ -93,6 +96,7 @@ bool open_own_directory(const listener *self, const std::string &path, int *out_
     *out_again = false;
     if (mkdir(path.c_str(), 0755) != 0 && errno != EEXIST)
         return fail_with_errno(out_error, path);
+    // lstat, so that a symbolic link is judged by its own owner, and is moved aside instead of followed.
     if (lstat(path.c_str(), &about) != 0) {
         *out_again = errno == ENOENT;
         return fail_with_errno(out_error, path);
@@ -102,6 +106,8 @@ bool open_own_directory(const listener *self, const std::string &path, int *out_
         return false;
     }
     *out_fd = open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    // The name may have been given to something else since lstat. What counts is the owner of what was
+    // opened.
     if (*out_fd < 0 || fstat(*out_fd, &about) != 0)
         return fail_with_errno(out_error, path);
     if (about.st_uid == geteuid())
@@ -111,12 +117,14 @@ bool open_own_directory(const listener *self, const std::string &path, int *out_
 }
 
 bool open_directory(const listener *self, int *out_fd, std::string *out_error) {
+    // Without the slash at the end, with which lstat and O_NOFOLLOW would follow a link.
     const std::string path(GCL_SOCKET_DIRECTORY, strlen(GCL_SOCKET_DIRECTORY) - 1);
     bool again = true;
     for (int i = 0; again && i < DIRECTORY_TRIES; i++) {
         close_fd(out_fd);
         if (!open_own_directory(self, path, out_fd, &again, out_error))
             continue;
+        // mkdir applies the umask, and an old directory may be open to others.
         if (fchmod(*out_fd, 0755) != 0)
             return fail_with_errno(out_error, path);
         return lock_alone(*out_fd, path, out_error);
@@ -138,6 +146,7 @@ pid_t find_client_of(std::string_view file) {
 } // namespace
 
 void listener_tidy(const listener *self) {
+    // closedir closes its descriptor, and a duplicate would share the read position with the original.
     const int fd = openat(self->directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     DIR *opened = fd < 0 ? nullptr : fdopendir(fd);
     if (!opened) {
@@ -149,6 +158,7 @@ void listener_tidy(const listener *self) {
     while (const dirent *file = readdir(files.get())) {
         const pid_t pid = find_client_of(file->d_name);
         struct stat about;
+        // Signal 0 only asks. EPERM means that the process exists and belongs to another user.
         if (pid > 0 && kill(pid, 0) != 0 && errno == ESRCH &&
             fstatat(self->directory, file->d_name, &about, AT_SYMLINK_NOFOLLOW) == 0 &&
             S_ISSOCK(about.st_mode))
@@ -165,6 +175,7 @@ void admit_viewers(listener *self) {
     struct stat about;
     if (self->viewers == static_cast<gid_t>(-1))
         return;
+    // The group first: with the wider mode, the former group would have access for a moment.
     if (lstat(self->path.c_str(), &about) == 0 &&
         (about.st_gid == self->viewers ||
          chown(self->path.c_str(), static_cast<uid_t>(-1), self->viewers) == 0) &&
@@ -179,6 +190,7 @@ bool open_socket(listener *self, std::string *out_error) {
     address.sun_family = AF_UNIX;
     strlcpy(address.sun_path, self->path.c_str(), sizeof address.sun_path);
     struct stat about;
+    // A socket was left by a killed mgmtd, because this one holds the lock. A directory can't be unlinked.
     if (unlink(address.sun_path) != 0 && errno == EISDIR && lstat(address.sun_path, &about) == 0 &&
         !move_aside(self, self->path, about.st_uid, out_error))
         return false;
@@ -187,6 +199,7 @@ bool open_socket(listener *self, std::string *out_error) {
         return fail_with_errno(out_error, "socket");
     // Clients may connect with a shorter address length. The kernel compares the path only, up to its zero
     // byte.
+    // A chmod after bind would be too late: others could connect in between.
     const mode_t before = umask(0177);
     const int bound = bind(self->socket, reinterpret_cast<sockaddr *>(&address), sizeof address);
     umask(before);
@@ -242,6 +255,7 @@ void listener_check(listener *self) {
         self->complaint.clear();
         return;
     }
+    // Closes what was opened before the failure. The next check tries again.
     close_place(self);
     if (error != self->complaint)
         self->say(self->path + " was removed and can't be made again: " + error);
@@ -249,6 +263,7 @@ void listener_check(listener *self) {
 }
 
 void listener_close(listener *self) {
+    // Another program's socket may have the name by now.
     if (is_in_place(*self))
         unlink(self->path.c_str());
     close_place(self);

@@ -44,6 +44,7 @@ int block_signals() {
     for (const int number : {SIGTERM, SIGINT, SIGHUP})
         sigaddset(&set, number);
     sigprocmask(SIG_BLOCK, &set, nullptr);
+    // For standard output. Sessions are written with MSG_NOSIGNAL.
     signal(SIGPIPE, SIG_IGN);
     return signalfd(-1, &set, SFD_NONBLOCK | SFD_CLOEXEC);
 }
@@ -60,6 +61,7 @@ void take_signals(int fd, server *daemon, supervisor *processes) {
 
 int64_t find_time_left(int64_t now, std::initializer_list<int64_t> due) {
     int64_t left = -1;
+    // -1 stands for nothing due, and as a result for no limit. What is overdue gives 0.
     for (const int64_t at : due)
         if (at >= 0 && (left < 0 || at - now < left))
             left = std::max<int64_t>(at - now, 0);
@@ -73,6 +75,7 @@ int64_t report_alive(int64_t *inout_at_ms) {
     const int64_t now = lt_monotonic_ms();
     if (now >= *inout_at_ms) {
         service_report("WATCHDOG=1");
+        // Several reports in each period, because a round may take long and reports may be lost.
         *inout_at_ms = now + service_watchdog_ms() / 4;
     }
     return *inout_at_ms;
@@ -107,6 +110,7 @@ int main(int argc, char **argv) {
     server daemon;
     std::string errors, warnings;
     daemon.file.path = config;
+    // Before the lock is taken, so that --check works while mgmtd runs. The file is only read here.
     const bool good = server_load(&daemon, &errors, &warnings);
     fputs((errors + warnings).c_str(), stderr);
     if (check || !good)
@@ -116,6 +120,7 @@ int main(int argc, char **argv) {
     daemon.say = print_line;
     daemon.supervises = supervise;
 
+    // Blocked before any child exists; a signal that arrives earlier ends the program.
     const int signals = block_signals();
     transport sockets;
     if (!transport_listen(&sockets, &daemon, &errors)) {
@@ -123,6 +128,7 @@ int main(int argc, char **argv) {
         transport_close(&sockets);
         return 1;
     }
+    // Files may be changed only while the lock is held.
     server_begin(&daemon);
     service_report("READY=1");
     print_line("mgmtd ready, " + std::to_string(daemon.tree.nodes.size()) + " nodes");
@@ -136,10 +142,13 @@ int main(int argc, char **argv) {
     processes.restarted = [&](const std::string &process, const std::string &last_end) {
         server_note_restart(&daemon, process, last_end);
     };
+    // tunneld first: wccpd orders tunnels as soon as it runs. Without --supervise the commands are empty, and
+    // the children are known by their sessions.
     processes.children = {{"tunneld", command_words(supervise ? tunneld : "")},
                           {"wccpd", command_words(supervise ? wccpd : "")}};
     processes.children.front().takes_over = true;
     for (child &process : processes.children)
+        // The path doesn't depend on the options, because the earlier run may have had others.
         process.lock_file = "/var/run/mgmtd." + process.name + ".lock";
     daemon.opened = [&](const std::string &name) { supervisor_session_opened(&processes, name); };
     daemon.closed = [&](const std::string &name) { supervisor_session_closed(&processes, name); };
@@ -150,12 +159,14 @@ int main(int argc, char **argv) {
         if (processes.ending && supervisor_is_done(processes))
             break;
         const int64_t query_due = server_tick(&daemon), alive_due = report_alive(&alive_at_ms);
+        // Built for each round: a child that was started has a new descriptor.
         std::vector<pollfd> others = {{signals, POLLIN, 0}};
         supervisor_watch(processes, &others);
         transport_round(&sockets, &others,
                         find_time_left(lt_monotonic_ms(), {child_due, query_due, alive_due}));
         if (others[0].revents & POLLIN)
             take_signals(signals, &daemon, &processes);
+        // Asks the kernel about each child; the result of poll only ends the wait.
         supervisor_reap(&processes);
     }
     service_report("STOPPING=1");

@@ -21,6 +21,7 @@ group_overlay server_overlay_of(const server *self, uint8_t group) {
     if (const auto slowed = self->slowed.find(group); slowed != self->slowed.end())
         out.weight_percent = slowed->second.percent;
     if (const auto drain = self->drains.find(group); drain != self->drains.end()) {
+        // A drain takes precedence over a slow start.
         out.weight_percent = 0;
         out.down = out.down || drain->second.left;
     }
@@ -50,6 +51,7 @@ bool find_overlay(const server *self, const node_name &name, group_overlay *out)
     const size_t depth = configured_groups().parts.size();
     if (name.parts.size() != depth + 2 || !name.is_under(configured_groups()))
         return false;
+    // The schema has checked the part: it is a number up to 255.
     *out = server_overlay_of(self, static_cast<uint8_t>(std::stoi(name.parts[depth])));
     return true;
 }
@@ -62,6 +64,8 @@ node_value server_value_for_wccpd(const server *self, const node_name &name, con
 }
 
 void server_adapt_for_wccpd(const server *self, std::vector<node_change> *inout) {
+    // Both values are replaced, because wccpd has the old one under the overlay as well. Changes that the
+    // overlay hides are left out and take effect when it ends.
     std::erase_if(*inout, [&](node_change &change) {
         group_overlay overlay;
         if (!find_overlay(self, change.name, &overlay))
@@ -80,6 +84,7 @@ void server_send_overlay(server *self, uint8_t group, const group_overlay &befor
     for (const char *leaf : {"weight", "admin"}) {
         const node_name name = configured_groups().below(std::to_string(group)).below(leaf);
         const auto found = self->tree.nodes.find(name);
+        // The group may have been deleted.
         if (found == self->tree.nodes.end())
             continue;
         const node_value was = lay_over(before, leaf, found->second), is = lay_over(now, leaf, found->second);

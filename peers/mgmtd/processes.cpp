@@ -43,6 +43,7 @@ std::string read_process_node(const server *self, const node_name &node) {
 
 void count_restart(server *self, const node_name &root) {
     node_value &restarts = self->state[root.below("restarts")];
+    // A new node has an empty text, which counts as 0.
     restarts = {bn_type_uint32, std::to_string(std::stoul("0" + restarts.text) + 1)};
 }
 
@@ -72,9 +73,11 @@ void server_note_process(server *self, const std::string &session) {
     self->state[root] = {bn_type_str, running ? "running" : "gone"};
     self->state[root.below("pid")] = {bn_type_uint32, pid};
     self->state[root.below("since")] = server_time_now();
+    // A process that has ended, or that has just started, has not failed to answer.
     self->state.erase(root.below("silent_since"));
     self->state.try_emplace(root.below("restarts"), node_value{bn_type_uint32, "0"});
     self->restarts[daemon].running_since_ms = running ? self->now_ms() : -1;
+    // The first process is not a restart. Under --supervise the supervisor counts.
     if (running && !same && !known_pid.empty() && !self->supervises)
         server_note_restart(self, daemon, "");
 }
@@ -88,6 +91,7 @@ void server_note_answer(server *self, const std::string &session, bool answered)
     if (answered)
         self->state.erase(silent);
     else
+        // The time of the first query that was not answered stays.
         self->state.try_emplace(silent, server_time_now());
 }
 
@@ -101,8 +105,10 @@ void server_note_restart(server *self, const std::string &process, const std::st
     count_restart(self, root);
     restart_watch &watch = self->restarts[process];
     watch.at_ms.push_back(now);
+    // Ends at the restart just added, at the latest.
     while (now - watch.at_ms.front() > RESTARTS_WITHIN_MS || watch.at_ms.size() > RESTARTS_KEPT)
         watch.at_ms.pop_front();
+    // An active alarm follows every restart, even when fewer are left in the period.
     if (watch.at_ms.size() < RESTARTS_MAX && !watch.alarm)
         return;
     const std::string text = "restarted " + std::to_string(watch.at_ms.size()) + " times in " +
@@ -121,6 +127,7 @@ int64_t server_clear_restart_alarms(server *self) {
     for (auto &[process, watch] : self->restarts) {
         if (!watch.alarm || watch.running_since_ms < 0)
             continue;
+        // `at_ms` isn't empty, because restarts have raised the alarm.
         const int64_t due = std::max(watch.running_since_ms, watch.at_ms.back()) + RESTARTS_WITHIN_MS;
         if (now >= due) {
             watch = {{}, watch.running_since_ms, false};

@@ -64,6 +64,7 @@ bool append_registrations(bn_request_msg *msg, const state_source &source) {
         bn_attrib_array_new(&attributes.pointer) != LC_OK ||
         bn_attrib_array_set_takeover(attributes.pointer, bn_attrib_capability_mask, &mask.pointer) != LC_OK)
         return false;
+    // The daemon answers walks from the list of nodes that the request carries; it keeps no list of its own.
     for (const char *name : source.nodes())
         if (bn_query_request_msg_append_with_attribs(msg, bn_query_registration_info, 0, name,
                                                      attributes.pointer, nullptr) != LC_OK)
@@ -89,13 +90,18 @@ void plan_node(std::vector<daemon_part> *parts, const asked_node &asked, const n
     for (size_t source = 0; source < std::size(state_sources); source++)
         for (const char *text : state_sources[source].roots) {
             const node_name root = parsed_name(text);
+            // By name: at or below the root of the daemon's nodes. Otherwise a walk of a subtree may contain
+            // the root.
             const bool by_name = is_at_or_under(name, root);
             if (!by_name && !(subtree && root.is_under(name)))
                 continue;
+            // From above, the daemon is asked for its own part only.
             const asked_node node = {asked.id, asked.subop, asked.flags, by_name ? name.text() : text};
             daemon_part *part = find_part(parts, source);
             part->whole |= by_name;
+            // All groups at once would make one answer of unknown size.
             (subtree && node.name == NODE_GROUP_STATE ? part->walks : part->nodes).push_back(node);
+            // The roots don't overlap: no other daemon has nodes there.
             if (by_name)
                 return;
         }
@@ -137,8 +143,10 @@ bool is_shown_all(const server *self, uint32_t asker) {
 // Appends the nodes that mgmtd answers itself. False when the answer exceeds a message: the query has been
 // refused.
 bool append_own_answers(server *self, const pending_query &query, bn_response_msg *response) {
+    // Counted while the answer grows, instead of building one that can't be sent.
     size_t bytes = query.gathered_bytes;
     const auto asker = self->peers.find(query.asker);
+    // The asker may have ended its session while the query waited.
     const bool runs_groups = asker != self->peers.end() && server_runs_groups(asker->second);
     const bool all = is_shown_all(self, query.asker);
     const auto append = [&](uint32_t id, const node_name &name, node_value value) {
@@ -164,6 +172,7 @@ bool append_own_answers(server *self, const pending_query &query, bn_response_ms
                         runs_groups ? server_value_for_wccpd(self, entry->first, entry->second)
                                     : entry->second))
                 return false;
+        // Made on request: these texts are not stored as nodes.
         if (asked.subop == bn_query_get && server_config_text(self, name, !all, &made) &&
             !append(asked.id, name, made))
             return false;
@@ -187,6 +196,8 @@ std::vector<asked_node> read_asked_nodes(const bn_request_msg *msg) {
 pending_query server_take_pending(server *self, std::map<uint32_t, pending_query>::iterator at) {
     pending_query out = std::move(at->second);
     self->pending_bytes -= out.bytes;
+    // The sums count only what is in `pending`. The caller has the query, and adds it again if it is
+    // forwarded.
     self->gathered_bytes -= out.gathered_bytes;
     self->pending.erase(at);
     return out;
@@ -208,6 +219,7 @@ bn_request_msg *make_forwarded(const state_source &source, const std::vector<ask
     if (bn_query_request_msg_create(&msg.pointer, 0, nullptr) != LC_OK ||
         !append_registrations(msg.pointer, source))
         return nullptr;
+    // One query is forwarded several times, each time with new ids.
     query->node_ids.clear();
     query->list_id = 0;
     for (const asked_node &node : nodes) {
@@ -237,6 +249,7 @@ uint32_t forward_query(server *self, const std::vector<asked_node> &nodes, bool 
         make_forwarded(state_sources[query.parts[query.next_part - 1].source], nodes, list_groups, &query));
     if (!msg.pointer)
         return LC_IO_CLOSED;
+    // Unique across all sessions, unlike the ids of other messages: an answer finds its query by it alone.
     const uint32_t id = msg.pointer->msg_id = self->next_query_id++, provider = query.provider;
     query.deadline_ms = self->now_ms() + MONITOR_TIMEOUT_MS;
     self->pending_bytes += query.bytes;
@@ -255,6 +268,7 @@ bool is_limit(uint32_t code) {
 // Sends the response: the nodes of mgmtd and those that daemons have answered. When a limit is exceeded, the
 // response has the code of the limit and no nodes.
 void finish_query(server *self, const pending_query &query, uint32_t code, const std::string &words) {
+    // A part of a walk without the rest would look like the whole.
     if (is_limit(code)) {
         refuse_query(self, query, code, words);
         return;
@@ -267,6 +281,7 @@ void finish_query(server *self, const pending_query &query, uint32_t code, const
     const bn_response_per_node_array *nodes = query.gathered ? query.gathered->nodes : nullptr;
     for (uint32_t i = 0; i < bn_response_per_node_array_length_quick(nodes); i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(nodes, i);
+        // Moves the binding; `gathered` is freed with the query.
         (void)bn_query_response_msg_append_binding_takeover(response.pointer, &node->binding, node->node_id);
     }
     (void)server_send_response(self, query.asker, response.pointer, query.asker_transaction_id);
@@ -277,6 +292,7 @@ void ask_next(server *self, pending_query query);
 // The daemon of the current part has answered everything, or failed. A failure is reported only if its nodes
 // were asked for by name.
 void end_part(server *self, pending_query query, uint32_t code, const std::string &words) {
+    // `next_part` is already that of the following part.
     const bool whole = query.next_part > 0 && query.parts[query.next_part - 1].whole;
     if (is_limit(code) || (code != LC_OK && whole))
         finish_query(self, query, code, words);
@@ -299,6 +315,7 @@ void ask_next(server *self, pending_query query) {
     query.groups.clear();
     query.next_group = 0;
     query.provider = find_provider(self, state_sources[part.source], query.asker);
+    // `query` is copied: if it can't be forwarded, it is still needed for the answer.
     const uint32_t code =
         query.provider ? forward_query(self, part.nodes, !part.walks.empty(), query) : uint32_t{LC_IO_CLOSED};
     if (code != LC_OK)
@@ -316,6 +333,7 @@ void server_answer_query(server *self, uint32_t peer_id, bn_request_msg *msg) {
     for (const asked_node &node : query.asked)
         if (node_name name; parse_node_name(node.name, &name))
             plan_node(&query.parts, node, name);
+    // The nodes of the request decide in which order the parts were found.
     std::ranges::sort(query.parts, {}, &daemon_part::source);
     ask_next(self, std::move(query));
 }
@@ -344,6 +362,7 @@ void hide_passwords_in(bn_binding **inout) {
 // Moves the bindings of the daemon's answer to the query. False when a limit is exceeded: the query has been
 // refused.
 bool gather_answer(server *self, pending_query *query, bn_response_msg *msg, size_t bytes) {
+    // The query is out of `pending`; its bytes are in none of the server's sums now.
     query->gathered_bytes += bytes;
     if (query->gathered_bytes > GCL_FRAME_MAX) {
         refuse_query(self, *query, LC_NO_BUFFER_SPACE, BN_TOO_LARGE);
@@ -368,6 +387,7 @@ bool gather_answer(server *self, pending_query *query, bn_response_msg *msg, siz
         if (asked != query->node_ids.end())
             (void)bn_query_response_msg_append_binding_takeover(query->gathered.get(), &node->binding,
                                                                 asked->second);
+        // Only the names are used: each group is asked for with its root node.
         else if (query->list_id && node->node_id == query->list_id)
             query->groups.push_back(name_of(node->binding));
     }
@@ -384,6 +404,7 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
     pending_query query = server_take_pending(self, found);
     if (!gather_answer(self, &query, msg, bytes))
         return;
+    // Also reached without groups: either there are none, or the part had no walk.
     if (msg->return_code != LC_OK || query.next_group == query.groups.size()) {
         end_part(self, std::move(query), msg->return_code,
                  msg->return_message ? ts_str(msg->return_message) : "");
@@ -392,6 +413,7 @@ void server_take_monitor_answer(server *self, uint32_t peer_id, bn_response_msg 
     std::vector<asked_node> nodes = query.parts[query.next_part - 1].walks;
     for (asked_node &node : nodes) {
         node.name = query.groups[query.next_group];
+        // The group's root is below the list that was asked for, but is itself the root of this walk.
         node.flags |= bn_qf_include_self;
     }
     query.next_group++;

@@ -36,6 +36,7 @@ node_value server_time_now() {
 void server_remove_report(server *self, const node_name &root) {
     self->alarm_owners.erase(root);
     self->state.erase(root);
+    // In the order of the map, the nodes below a root follow it immediately.
     for (auto at = self->state.lower_bound(root); at != self->state.end() && at->first.is_under(root);)
         at = self->state.erase(at);
 }
@@ -43,8 +44,10 @@ void server_remove_report(server *self, const node_name &root) {
 namespace {
 
 bool claim_report(server *self, uint32_t peer_id, const node_name &root) {
+    // A repeated report needs no further place.
     if (!self->alarm_owners.contains(root) && self->alarm_owners.size() >= ALARMS_MAX)
         return false;
+    // The last reporter counts: a restarted daemon may report before the end of the old session is noticed.
     self->alarm_owners[root] = peer_id;
     return true;
 }
@@ -152,6 +155,7 @@ void report_forgotten(server *self, const node_name &root) {
     if (root.is_under(parsed_name(NODE_ROLES)))
         server_send_event(self, EVENT_ROLE_CHANGE,
                           {{"group", {bn_type_str, last}},
+                           // 2 is UNKNOWN.
                            {"role", {bn_type_uint32, "2"}},
                            {"code", {bn_type_uint32, "0"}}});
     else
@@ -168,6 +172,7 @@ void report_forgotten(server *self, const node_name &root) {
 void server_forget_reports(server *self, uint32_t peer_id) {
     std::vector<node_name> gone;
     for (const auto &[root, owner] : self->alarm_owners)
+        // mgmtd's own alarms are never among them: sessions are numbered from 1.
         if (owner == peer_id)
             gone.push_back(root);
     for (const node_name &root : gone) {

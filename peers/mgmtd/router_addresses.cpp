@@ -22,9 +22,11 @@ std::vector<local_address> find_local_addresses() {
         return out;
     const std::unique_ptr<ifaddrs, void (*)(ifaddrs *)> held(first, freeifaddrs);
     for (const ifaddrs *at = first; at; at = at->ifa_next) {
+        // An interface without an address has a null pointer.
         if (!at->ifa_addr || at->ifa_addr->sa_family != AF_INET)
             continue;
         const uint32_t address = read_host_order(at->ifa_addr);
+        // A network of one or two addresses (/32, /31) has no broadcast address.
         const uint32_t hosts = at->ifa_netmask ? ~read_host_order(at->ifa_netmask) : 0;
         out.push_back({address, hosts > 1 ? address | hosts : 0});
     }
@@ -39,10 +41,12 @@ bool is_multicast(uint32_t address) {
 
 // The reason why the address cannot belong to a router; null: it can.
 const char *find_fault(uint32_t address, size_t routers, const std::vector<local_address> &local) {
+    // The routers of a multicast group are known from their answers; the one address stands for all of them.
     if (is_multicast(address))
         return routers > 1 ? "is a multicast address, which must be the only router of its group" : nullptr;
     if (address >> 24 == 127)
         return "is a loopback address; give the address of the router";
+    // 240.0.0.0/4, with 255.255.255.255.
     if (address >> 24 == 0 || address >> 28 == 0xf)
         return "is a broadcast or reserved address; give the address of the router";
     for (const local_address &own : local) {
@@ -56,6 +60,7 @@ const char *find_fault(uint32_t address, size_t routers, const std::vector<local
 
 node_list collect_routers(const node_tree &tree, const node_name &group) {
     node_list out;
+    // The leaves are the addresses; the numbers of the routers don't matter here.
     collect_nodes(tree.nodes, group.below("router"), {true, false, true}, &out);
     return out;
 }
@@ -79,10 +84,13 @@ std::vector<std::string> find_bad_routers(const node_tree &tree, const node_tree
     collect_nodes(tree.nodes, groups, {false, false, false}, &roots);
     for (const auto *root : roots) {
         const node_list routers = collect_routers(tree, root->first);
+        // A group that the change doesn't touch must not prevent it, even if its routers have become bad
+        // meanwhile.
         if (before && are_same_routers(routers, collect_routers(*before, root->first)))
             continue;
         for (const auto *router : routers) {
             in_addr address = {};
+            // Can't fail: the value has the type of an address.
             (void)inet_pton(AF_INET, router->second.text.c_str(), &address);
             if (const char *fault = find_fault(ntohl(address.s_addr), routers.size(), local))
                 out.push_back(router->first.text() + ": " + router->second.text + " " + fault);

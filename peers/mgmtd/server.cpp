@@ -28,9 +28,11 @@ bool server_send_request(server *self, uint32_t peer_id, bn_request_msg *msg) {
     if (!msg || found == self->peers.end())
         return false;
     msg->service_id = SERVICE;
+    // A forwarded query has an id already, by which its answer is recognized.
     if (msg->msg_id == 0)
         msg->msg_id = found->second.next_message_id++;
     if (msg->transaction_id == 0)
+        // As the client library numbers its own messages.
         msg->transaction_id = msg->msg_id + 1;
     owned_tbuffer frame;
     if (bn_request_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &frame.pointer) != LC_OK)
@@ -71,8 +73,10 @@ bool server_send_response(server *self, uint32_t peer_id, bn_response_msg *msg, 
     msg->transaction_id = transaction_id;
     msg->db_revision_id = self->tree.revision;
     owned_tbuffer frame;
+    // A request always gets a response, because the client waits for one.
     if (bn_response_msg_serialize(msg, BN_FRAME_HEADER_BYTES, &frame.pointer) != LC_OK ||
         frame.pointer->length > GCL_FRAME_MAX) {
+        // The large frame is freed before the refusal is made.
         frame.pointer = make_refusal(msg, BN_TOO_LARGE, frame.take());
     } else if (self->fits && !self->fits(peer_id, frame.pointer->length)) {
         frame.pointer =
@@ -106,6 +110,7 @@ void server_send_event(server *self, const std::string &event, const std::vector
     for (const auto &[id, who] : self->peers)
         if (wants_event(who, event))
             ids.push_back(id);
+    // A message for each receiver: the ids in it are those of the session.
     for (const uint32_t id : ids) {
         const owned_request msg(make_event(event, fields));
         (void)server_send_request(self, id, msg.pointer);
@@ -136,6 +141,7 @@ size_t count_interest_bytes(const interest &wish) {
 bool may_add_interest(const peer &who, const interest &wish) {
     size_t count = 1, bytes = count_interest_bytes(wish);
     for (const interest &old : who.interests)
+        // An interest in the same event is replaced and needs no further room.
         if (old.event != wish.event) {
             count++;
             bytes += count_interest_bytes(old);
@@ -190,6 +196,7 @@ action_answer report_process(server *self, uint32_t, const std::vector<event_fie
     if (!process || process->empty() || found == events.end())
         return {LC_BAD_ARGUMENT,
                 "A report needs process_name and event: crash, unexpected_exit or terminate"};
+    // Under --supervise the supervisor has seen the end itself. The reporter gets code 0 all the same.
     if (!self->is_news || self->is_news(*process))
         server_process_event(self, found->second, *process);
     return {};
@@ -235,6 +242,7 @@ std::string read_text(const tstring *text) {
 bool may_change(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     const peer_owner &owner = self->peers[peer_id].owner;
     if (!owner.may_change)
+        // Answered and not dropped, so that the client does not wait.
         send_answer(self, peer_id, msg, LC_BAD_LOGIN, owner.user + " may look, but not change anything");
     return owner.may_change;
 }
@@ -259,8 +267,10 @@ commit_order read_commit_order(const peer &who, const bn_request_msg *msg) {
     order.who = who.name;
     order.user = who.owner.user;
     if (const std::string person = read_text(msg->audit_user); !person.empty())
+        // The kernel vouches for the user of the session, but nobody for this name; both are kept.
         order.user += " (" + person + ")";
     order.cause = read_text(msg->text);
+    // The client's name is better than nothing in the list of commits.
     if (order.cause.empty())
         order.cause = who.name;
     order.check_only = msg->flags & bn_cf_check_only;
@@ -275,6 +285,7 @@ void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
     std::vector<set_step> steps;
     if (!may_change(self, peer_id, msg))
         return;
+    // An unknown flag may be a condition of the commit and can't be ignored.
     if (msg->flags & ~known) {
         send_answer(self, peer_id, msg, LC_NOT_IMPLEMENTED,
                     "The request has commit flags that are not known");
@@ -286,10 +297,12 @@ void take_set(server *self, uint32_t peer_id, const bn_request_msg *msg) {
         const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, i);
         if (!node || !node->binding)
             continue;
+        // A deletion may come without a value.
         const node_value value = value_of(node->binding);
         set_step step{set_kind::modify, name_of(node->binding), value.type, value.text};
         if (node->subop == bn_set_create)
             step.kind = set_kind::create;
+        // The same for both: what has a default returns to it, and everything else is gone.
         else if (node->subop == bn_set_delete || node->subop == bn_set_reset)
             step.kind = set_kind::remove;
         else if (node->subop != bn_set_modify) {
@@ -322,17 +335,22 @@ void server_peer_closed(server *self, uint32_t peer_id) {
     const auto found = self->peers.find(peer_id);
     if (found == self->peers.end())
         return;
+    // A copy, because the record is erased before the name is used.
     const std::string name = found->second.name;
     self->say("session of " + name + " closed");
+    // Erased first: the checks below ask whether the daemon has another session, and events are not for this
+    // one.
     self->peers.erase(found);
     if (self->closed)
         self->closed(name);
     server_note_process(self, name);
+    // Collected first, because the answers change `pending`: a query may be forwarded to the next daemon.
     std::vector<pending_query> left;
     for (auto at = self->pending.begin(); at != self->pending.end();) {
         const auto query = at++;
         if (query->second.provider == peer_id)
             left.push_back(server_take_pending(self, query));
+        // Nobody waits for it any more. A late answer of the daemon is ignored.
         else if (query->second.asker == peer_id)
             (void)server_take_pending(self, query);
     }
@@ -356,6 +374,7 @@ void answer_late_queries(server *self) {
     for (const pending_query &query : late) {
         const auto provider = self->peers.find(query.provider);
         const std::string name = provider == self->peers.end() ? "the daemon" : provider->second.name;
+        // The session continues: the daemon may only be slow, and wccpd exits when its session ends.
         self->say("query: no answer from " + name);
         server_note_answer(self, name, false);
         server_answer_without(self, query, LC_IO_TIMED_OUT, name + " did not answer in time");
@@ -383,6 +402,7 @@ constexpr uint32_t FIELDS_MAX = 1024; // of an action or event: they are copied,
 
 bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer *frame) {
     owned_request msg;
+    // The type is in the frame header and in the message; handlers rely on both being the same.
     if (bn_request_msg_deserialize(frame, BN_FRAME_HEADER_BYTES, &msg.pointer) != LC_OK ||
         msg.pointer->msg_type != mtype)
         return false;
@@ -406,6 +426,7 @@ bool take_request(server *self, uint32_t peer_id, uint16_t mtype, const tbuffer 
         if (!may_change(self, peer_id, msg.pointer))
             return true;
         server_take_event(self, peer_id, read_text(msg.pointer->text), fields_of(msg.pointer));
+        // An event is acknowledged in any case, also one that was ignored.
         send_answer(self, peer_id, msg.pointer, 0, "");
         return true;
     default:
@@ -423,6 +444,8 @@ bool server_take_frame(server *self, uint32_t peer_id, uint16_t mtype, const tbu
     owned_response msg;
     if (bn_response_msg_deserialize(frame, BN_FRAME_HEADER_BYTES, &msg.pointer) != LC_OK)
         return false;
+    // Other responses answer mgmtd's events. They are read, because a malformed one ends the session, and not
+    // used.
     if (mtype == bn_msg_query_response)
         server_take_monitor_answer(self, peer_id, msg.pointer, frame->length);
     return true;

@@ -46,12 +46,14 @@ std::vector<std::string> command_words(const std::string &line) {
 }
 
 int64_t next_delay(int64_t before_ms, int64_t ran_ms) {
+    // 0 also after an immediate restart, so that the delays begin anew.
     if (before_ms == 0 || ran_ms >= SETTLED_MS)
         return RESTART_DELAY_FIRST_MS;
     return std::min(before_ms * 2, RESTART_DELAY_MAX_MS);
 }
 
 const char *end_event(int wait_status, bool ending) {
+    // SIGTERM is how an operator ends a program: not a crash, although a signal has ended it.
     if (ending || (WIFSIGNALED(wait_status) && WTERMSIG(wait_status) == SIGTERM))
         return EVENT_PROCESS_TERMINATE;
     return WIFSIGNALED(wait_status) ? EVENT_PROCESS_CRASH : EVENT_PROCESS_EXIT;
@@ -66,6 +68,7 @@ std::string end_text(int wait_status) {
 
 [[noreturn]] void exec_child(const std::vector<std::string> &command, pid_t parent, int lock) {
     prctl(PR_SET_PDEATHSIG, SIGTERM);
+    // mgmtd may have died before prctl took effect; no signal would follow.
     if (getppid() != parent)
         _exit(127);
     sigset_t none;
@@ -74,14 +77,17 @@ std::string end_text(int wait_status) {
     for (int number = 1; number < NSIG; number++) // ignored signals would stay ignored in the program
         signal(number, SIG_DFL);
     if (lock >= 0)
+        // The lock belongs to the open file, which the program now inherits and keeps until it ends.
         fcntl(lock, F_SETFD, 0);
     std::vector<char *> arguments;
     arguments.reserve(command.size() + 1);
     for (const std::string &word : command)
+        // execvp does not write to its arguments.
         arguments.push_back(const_cast<char *>(word.c_str()));
     arguments.push_back(nullptr);
     execvp(arguments[0], arguments.data());
     dprintf(STDERR_FILENO, "%s: %s\n", arguments[0], strerror(errno));
+    // Not exit(): buffers and exit handlers inherited from mgmtd must not run here.
     _exit(127);
 }
 
@@ -98,6 +104,7 @@ const char *fork_child(child *process) {
     process->pidfd = pidfd_open(pid, 0); // the number is valid until the child is waited for
     if (process->pidfd >= 0)
         return nullptr;
+    // A child without a descriptor could not be watched; kill and waitpid overwrite errno.
     const int error = errno;
     kill(pid, SIGKILL);
     waitpid(pid, nullptr, 0);
@@ -111,6 +118,8 @@ bool lock_run(child *process) {
     if (process->lock_file.empty())
         return true;
     process->lock = open(process->lock_file.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+    // The lock is on a file of its own and not on a process id, so that a killed mgmtd leaves nothing to
+    // clean up.
     if (process->lock < 0 || flock(process->lock, LOCK_EX | LOCK_NB) == 0)
         return true;
     close(process->lock);
@@ -128,12 +137,14 @@ void start_child(supervisor *self, child *process) {
     }
     process->waits = false;
     const char *failed = fork_child(process);
+    // Only this copy: the child's descriptor keeps the lock.
     if (process->lock >= 0)
         close(process->lock);
     process->lock = -1;
     process->started_ms = self->now_ms();
     if (failed) {
         const std::string reason = strerror(errno);
+        // Counts as a run of no length; the failure may be a lack of memory or processes that passes.
         process->delay_ms = next_delay(process->delay_ms, 0);
         process->start_at_ms = process->started_ms + process->delay_ms;
         self->say("process " + process->name + ": " + failed + ": " + reason);
@@ -163,9 +174,12 @@ bool has_ended(const child &process, int *out_status) {
     if (process.pidfd < 0)
         return false;
     if (waitid(P_PIDFD, static_cast<id_t>(process.pidfd), &info, WEXITED | WNOHANG) != 0)
+        // ECHILD: there is no status to wait for, and nothing would ever come.
         return errno == ECHILD;
+    // With WNOHANG this is how waitid reports that the child still runs.
     if (info.si_pid == 0)
         return false;
+    // waitid has no wait status; a signal's number is one by itself.
     *out_status = info.si_code == CLD_EXITED ? W_EXITCODE(info.si_status, 0) : info.si_status;
     return true;
 }
@@ -176,10 +190,13 @@ bool is_orderly(int wait_status) {
 
 void take_end(supervisor *self, child *process, int status) {
     const int64_t now = self->now_ms(), ran = now - process->started_ms;
+    // After an orderly end the tunnels are gone, and there is nothing to take over.
     const bool may_be_replaced = process->takes_over && !self->ending && !is_orderly(status);
     process->last_end = end_text(status);
+    // If the replacement fails too, the loss counts from the first end.
     if (may_be_replaced && process->has_session && !process->loss)
         process->loss = {end_event(status, false), end_text(status), now};
+    // A child that crashes right after it has opened its session must not be restarted in a tight loop.
     process->delay_ms =
         process->loss && process->has_session && ran >= SHORT_RUN_MS ? 0 : next_delay(process->delay_ms, ran);
     process->start_at_ms = now + process->delay_ms;
@@ -187,6 +204,7 @@ void take_end(supervisor *self, child *process, int status) {
         return; // a later line says whether it has been replaced
     self->say("process " + process->name + ": " + end_text(status) +
               (self->ending ? "" : ", starts again in " + std::to_string(process->delay_ms / 1000) + " s"));
+    // report_loss() reports it unless a new run has a session in time.
     if (may_be_replaced && process->loss)
         return;
     process->loss.reset();
@@ -209,8 +227,10 @@ void supervisor_reap(supervisor *self) {
 namespace {
 
 bool is_session_of(const child &process, const std::string &name) {
+    // Its process id is not known: every session with its name counts.
     if (process.command.empty())
         return name.starts_with(process.name + "-");
+    // A late session of an earlier run is not one of this child.
     return process.pidfd >= 0 && name == process.name + "-" + std::to_string(process.pid);
 }
 
@@ -232,6 +252,8 @@ void supervisor_session_opened(supervisor *self, const std::string &name) {
 
 void supervisor_session_closed(supervisor *self, const std::string &name) {
     for (child &process : self->children) {
+        // The end of a child is known from its descriptor. wccpd has two sessions, and only the last one to
+        // close counts.
         if (!process.command.empty() || !is_session_of(process, name) || --process.sessions > 0 ||
             process.end_reported || self->ending)
             continue;
@@ -246,8 +268,10 @@ bool supervisor_take_report(supervisor *self, const std::string &process) {
     for (child &each : self->children) {
         if (each.name != process)
             continue;
+        // The supervisor has the exit status, which is more reliable than the report.
         if (!each.command.empty())
             return false;
+        // The sessions are about to close and would otherwise be reported as another end.
         each.end_reported = true;
         each.loss.reset();
     }
@@ -271,6 +295,8 @@ int64_t report_loss(supervisor *self, child *process, int64_t now) {
 }
 
 int64_t end_last(supervisor *self, int64_t now) {
+    // wccpd first: during its orderly exit it still needs tunneld, which deletes the tunnels. The next child
+    // is signalled only after this one has ended.
     for (auto process = self->children.rbegin(); process != self->children.rend(); ++process) {
         if (process->pidfd < 0)
             continue;
@@ -298,6 +324,7 @@ int64_t supervisor_tick(supervisor *self) {
         const bool may_start = process.pidfd < 0 && !process.command.empty();
         if (may_start && process.start_at_ms <= now)
             start_child(self, &process);
+        // A start that failed or waits for an earlier run has set a new time meanwhile.
         for (const int64_t due :
              {may_start && process.pidfd < 0 ? process.start_at_ms : -1, report_loss(self, &process, now)})
             if (due >= 0 && (next < 0 || due < next))

@@ -42,6 +42,7 @@ bool transport_listen(transport *self, server *owner, std::string *out_error) {
     self->owner = owner;
     owner->fits = [self](uint32_t id, size_t bytes) {
         const auto found = self->sessions.find(id);
+        // For a session that is gone, the frame is dropped when it is sent.
         return found == self->sessions.end() || fits_queue(found->second, bytes);
     };
     owner->send = [self](uint32_t id, uint16_t mtype, tbuffer *frame) { send_bnode(self, id, mtype, frame); };
@@ -63,6 +64,7 @@ namespace {
 void end_session(transport *self, session *client, const std::string &why) {
     if (client->ended)
         return;
+    // Only marked: callers iterate over the sessions or hold pointers to them.
     client->ended = true;
     if (!why.empty())
         self->owner->say("session of " + (client->name.empty() ? "a client" : client->name) + ": " + why);
@@ -76,6 +78,7 @@ void queue_frame(transport *self, session *client, uint16_t proto, uint16_t mtyp
     header.version = to_be32(GCL_FRAME_VERSION);
     header.total_length = to_be32(length);
     header.header_length = to_be16(sizeof header);
+    // Nothing on the other side checks the sequence; it helps when a trace is read.
     header.sequence = to_be32(client->sequence++);
     header.proto = to_be16(proto);
     header.mtype = to_be16(mtype);
@@ -98,10 +101,12 @@ void flush_queue(transport *self, session *client) {
             continue;
         if (sent < 0 && (errno == EAGAIN || errno == EWOULDBLOCK))
             return;
+        // Without a log line: the client has gone, and its session is logged as closed.
         if (sent < 0) {
             end_session(self, client, "");
             return;
         }
+        // The kernel may take a part of a frame; the rest stays at the head of the queue.
         client->written += static_cast<size_t>(sent);
         if (client->written < frame.size())
             continue;
@@ -175,10 +180,12 @@ bool take_greeting_response(transport *self, session *client, std::string_view f
     const bool printable =
         !name.empty() && std::all_of(name.begin(), name.end(), [](char c) { return c > 0x20 && c < 0x7f; });
     if (to_host(response.version) != GCL_ADMIN_VERSION || !printable ||
+        // A client may leave its user open with -1. Rights depend only on what the kernel has reported.
         (uid != client->uid && uid != UINT32_MAX)) {
         end_session(self, client, "bad version, name or user in its greeting response");
         return false;
     }
+    // This session does not count itself, because it is still in the stage `greeting_sent`.
     const bool allowed = has_place(self, name);
     client->name = name;
     if (is_daemon_name(name) && !client->owner.may_change) {
@@ -208,16 +215,19 @@ bool take_open_service(transport *self, uint32_t id, session *client, std::strin
                                                 : nullptr;
     gcl_wire_open_service_response response{};
     response.message_id = to_be32(self->admin_messages++);
+    // Returned as they came; the client matches its request by them.
     response.request_second_counter = request.second_counter;
     response.request_message_id = request.message_id;
     strlcpy(response.peer_name, PROVIDER_NAME, sizeof response.peer_name);
     response.status = to_be32(refusal ? 1 : 0);
     response.text_length = to_be32(refusal ? static_cast<uint32_t>(strlen(refusal)) : 0);
     send_admin(self, client, GCL_ADMIN_OPEN_SERVICE_RESPONSE, response,
+               // With a NUL, which the length in the message does not count.
                refusal ? std::string(refusal, strlen(refusal) + 1) : "");
     if (refusal) {
         self->owner->say("session of " + client->name + ": service " + std::to_string(service) + " refused");
     } else if (client->stage == session::greeted) {
+        // Not for further services, which are granted on the same session.
         client->stage = session::opened;
         server_peer_opened(self->owner, id, client->name, client->owner);
     }
@@ -235,6 +245,7 @@ void take_frame(transport *self, uint32_t id, session *client, const gcl_wire_he
         (void)take_open_service(self, id, client, frame);
     } else if (proto == BN_PROTO && client->stage == session::opened) {
         owned_tbuffer buffer;
+        // `frame` points into `unread`, which nothing changes until the frame has been handled.
         if (tb_new_buf_const(&buffer.pointer, frame.data(), static_cast<uint32_t>(frame.size())) != LC_OK ||
             !server_take_frame(self->owner, id, mtype, buffer.pointer))
             end_session(self, client, "a message that can't be read, ended");
@@ -246,6 +257,7 @@ void take_frame(transport *self, uint32_t id, session *client, const gcl_wire_he
 
 bool header_is_sound(const session &client, const gcl_wire_header &header) {
     const uint32_t total = to_host(header.total_length);
+    // Bounds what is stored while the frame is incomplete.
     const uint32_t most = client.stage == session::opened ? GCL_FRAME_MAX : OPENING_FRAME_MAX;
     return memcmp(header.ident, GCL_FRAME_IDENT, sizeof header.ident) == 0 &&
            to_host(header.version) == GCL_FRAME_VERSION && to_host(header.header_length) == sizeof header &&
@@ -268,11 +280,13 @@ void take_frames(transport *self, uint32_t id, session *client) {
         at += total;
         take_frame(self, id, client, header, frame);
     }
+    // Once for all frames; erasing each one would move the rest each time.
     client->unread.erase(0, at);
 }
 
 void read_session(transport *self, uint32_t id, session *client) {
     char bytes[65536];
+    // A client that sends without pause must not keep the others waiting.
     for (int turns = 0; turns < READS_A_TURN; turns++) {
         const ssize_t got = recv(client->fd, bytes, sizeof bytes, MSG_DONTWAIT);
         if (got < 0 && errno == EINTR)
@@ -281,10 +295,12 @@ void read_session(transport *self, uint32_t id, session *client) {
             return;
         if (got > 0) {
             client->unread.append(bytes, static_cast<size_t>(got));
+            // Before the next read, so that `unread` holds little more than one incomplete frame.
             take_frames(self, id, client);
         }
         if (got <= 0)
             end_session(self, client, "");
+        // A short read has emptied the socket; poll reports what follows.
         if (client->ended || got < static_cast<ssize_t>(sizeof bytes))
             return;
     }
@@ -305,6 +321,7 @@ bool make_room(transport *self) {
 // --- The user of a client
 
 bool is_member(int fd, const ucred &who, gid_t group) {
+    // The supplementary groups at the time of the connection. The option takes and returns bytes.
     gid_t groups[256];
     socklen_t length = sizeof groups;
     if (group == static_cast<gid_t>(-1))
@@ -327,6 +344,7 @@ std::string name_of_user(uid_t uid) {
 std::string identify_client(const transport *self, int fd, session *out) {
     ucred who{};
     socklen_t length = sizeof who;
+    // The user at the time of connect(): later changes of the process have no effect.
     if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &who, &length) != 0)
         return "its user is not known";
     out->uid = who.uid;
@@ -335,6 +353,7 @@ std::string identify_client(const transport *self, int fd, session *out) {
         return "";
     if (!is_member(fd, who, self->place.viewers))
         return out->owner.user;
+    // All their connections count, also those that have not greeted, so that they can't crowd out others.
     const auto viewers = std::ranges::count_if(
         self->sessions, [](const auto &each) { return !each.second.ended && !each.second.owner.may_change; });
     return viewers < static_cast<ptrdiff_t>(VIEWER_SESSIONS_MAX) ? "" : "too many of those who may only look";
@@ -348,6 +367,7 @@ void accept_session(transport *self) {
             self->accept_at_ms = self->owner->now_ms() + ACCEPT_PAUSE_MS;
         return;
     }
+    // A new session is a good time to remove what killed clients have left.
     listener_tidy(&self->place);
     session client{};
     std::string refusal = identify_client(self, fd, &client);
@@ -361,6 +381,7 @@ void accept_session(transport *self) {
     client.fd = fd;
     client.sequence = GCL_SEQUENCE_PROVIDER;
     client.open_by_ms = self->owner->now_ms() + OPENING_MAX_MS;
+    // The greeting is queued in the stored session.
     session &kept = self->sessions[self->next_id++] = std::move(client);
     send_greeting(self, &kept);
 }
@@ -375,6 +396,7 @@ void remove_ended_sessions(transport *self) {
                 continue;
             const uint32_t id = at->first;
             close(at->second.fd);
+            // Erased before the server is notified, so that no event is queued for it.
             self->sessions.erase(at);
             server_peer_closed(self->owner, id);
             again = true;
@@ -390,6 +412,7 @@ int64_t run_timers(transport *self, int64_t timeout_ms) {
         listener_check(&self->place);
         self->check_place_at_ms = now + LISTENER_CHECK_MS;
     }
+    // There is always a next time, because the name of the socket is checked regularly.
     int64_t next = self->check_place_at_ms;
     if (now < self->accept_at_ms)
         next = std::min(next, self->accept_at_ms);
@@ -409,14 +432,17 @@ int64_t run_timers(transport *self, int64_t timeout_ms) {
 void transport_round(transport *self, std::vector<pollfd> *inout_others, int64_t timeout_ms) {
     const int64_t limit_ms = run_timers(self, timeout_ms);
     for (auto &[id, client] : self->sessions)
+        // The timers of the caller may have queued frames.
         flush_queue(self, &client);
     remove_ended_sessions(self);
     std::vector<pollfd> watched = *inout_others;
     const size_t others = watched.size();
+    // While accepting pauses, the socket is left out: poll ignores negative descriptors.
     const bool accepts = self->owner->now_ms() >= self->accept_at_ms;
     watched.push_back({accepts ? self->place.socket : -1, POLLIN, 0});
     std::vector<uint32_t> ids;
     for (const auto &[id, client] : self->sessions) {
+        // POLLOUT only while something waits, because a writable socket would end every poll at once.
         watched.push_back({client.fd, static_cast<short>(POLLIN | (client.queue.empty() ? 0 : POLLOUT)), 0});
         ids.push_back(id);
     }
@@ -424,10 +450,12 @@ void transport_round(transport *self, std::vector<pollfd> *inout_others, int64_t
         return;
     std::copy_n(watched.begin(), others, inout_others->begin());
     for (size_t i = 0; i < ids.size(); i++) {
+        // Sessions are removed only at the end of the round, and every id still exists.
         session &client = self->sessions[ids[i]];
         const short came = watched[others + 1 + i].revents;
         if (came & POLLOUT)
             flush_queue(self, &client);
+        // After a hang-up there may still be frames to read; recv then reports the end.
         if (came & (POLLIN | POLLHUP | POLLERR))
             read_session(self, ids[i], &client);
     }

@@ -28,7 +28,9 @@ node_value value_of(const bn_binding *binding) {
         bn_attrib_array_length_quick(binding->attributes) <= bn_attrib_value ||
         bn_binding_get_type(binding, bn_attrib_value, &out.type, &flags) != LC_OK)
         return out;
+    // The field also has the flags.
     out.type &= BN_TYPE_MASK;
+    // A node may be reported without its value. Its type counts all the same.
     if (!(flags & bn_flag_no_value) &&
         bn_binding_get_str(binding, bn_attrib_value, 0, nullptr, &text.pointer) == LC_OK && text.pointer)
         out.text = text.pointer;

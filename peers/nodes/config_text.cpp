@@ -16,10 +16,12 @@ namespace {
 
 std::string trim_blanks(const std::string &text) {
     const size_t from = text.find_first_not_of(" \t\r");
+    // A carriage return counts as blank, so that a file with DOS line ends can be read.
     return from == std::string::npos ? "" : text.substr(from, text.find_last_not_of(" \t\r") + 1 - from);
 }
 
 bool strip_quotes(const std::string &text, std::string *out, std::string *out_reason) {
+    // Quotes in the middle of a value are ordinary characters.
     *out = text;
     if (text.empty() || text[0] != '"')
         return true;
@@ -31,6 +33,7 @@ bool strip_quotes(const std::string &text, std::string *out, std::string *out_re
             *out_reason = "text after the closing quote";
             return false;
         }
+        // A backslash protects any character, also those that add_quotes() leaves alone.
         if (text[i] == '\\' && i + 1 < text.size())
             i++;
         *out += text[i];
@@ -40,6 +43,7 @@ bool strip_quotes(const std::string &text, std::string *out, std::string *out_re
 }
 
 std::string add_quotes(const std::string &text) {
+    // Only values that would be read differently without quotes get them.
     if (!text.empty() && trim_blanks(text) == text && text[0] != '"')
         return text;
     std::string out = "\"";
@@ -87,6 +91,7 @@ void make_instances(parser *state, const node_name &name) {
 }
 
 bool take_section(parser *state, const std::string &line, std::string *out_reason) {
+    // For the line "[" the length wraps around, which substr allows. The check below refuses the line.
     const std::string name_text = trim_blanks(line.substr(1, line.size() - 2));
     node_name name;
     if (line.back() != ']' || !parse_node_name(name_text, &name)) {
@@ -96,12 +101,14 @@ bool take_section(parser *state, const std::string &line, std::string *out_reaso
     const schema_row *row = find_schema_row(name);
     std::string text;
     if (row && row->instance) {
+        // An instance's own value follows from its name.
         if (!check_value(*row, name, "", &text, out_reason))
             return false;
         make_instances(state, name);
         state->text->lines.emplace(name, state->line);
     }
     bool known = false;
+    // The name is good if it is the beginning of the pattern of some row, or all of it.
     for (const schema_row &candidate : schema_rows()) {
         node_name above = candidate.parts;
         if (above.parts.size() < name.parts.size())
@@ -114,8 +121,10 @@ bool take_section(parser *state, const std::string &line, std::string *out_reaso
         return false;
     }
     state->section = name.text();
+    // A section that has had no node passes its comments on to the next one.
     state->heading += state->pending;
     state->pending.clear();
+    // An instance is written even without lines; therefore its comments have their place already.
     if (row && row->instance)
         place_heading(state, name);
     return true;
@@ -147,6 +156,7 @@ bool take_value(parser *state, const std::string &line, std::string *out_reason)
         *out_reason = shown_text(name.text()) + ": " + *out_reason;
         return false;
     }
+    // An instance may be given twice, by its section and by a line of its own; a value may not.
     if (const auto [earlier, fresh] = state->text->lines.emplace(name, state->line);
         !fresh && !row->instance) {
         *out_reason = name.text() + ": was given in line " + std::to_string(earlier->second) + " already";
@@ -182,6 +192,7 @@ bool take_line(parser *state, const std::string &line, std::string *out_reason) 
         state->skipping = !good;
         return good;
     }
+    // The lines of a refused section would otherwise be read as lines of the section before it.
     return state->skipping || take_value(state, line, out_reason);
 }
 
@@ -196,6 +207,8 @@ bool config_parse_part(const std::string &content, const std::string &file, conf
         std::string reason;
         at = end + 1;
         state.line++;
+        // Not a comment of the operator, and not to be written again: a copy of a kept commit must not keep
+        // its description.
         if (line.starts_with(CONFIG_NOTE))
             continue;
         if (!line.empty() && line[0] == '#')
@@ -203,6 +216,7 @@ bool config_parse_part(const std::string &content, const std::string &file, conf
         else if (!line.empty() && !take_line(&state, line, &reason))
             out->errors.append(file).append(":" + std::to_string(state.line) + ": ").append(reason + "\n");
     }
+    // Comments after the last node have nothing to belong to and stay at the end.
     if (const std::string last = state.heading + state.pending; !last.empty())
         out->comments.before[""] = last;
     tree_refresh(&out->tree);
@@ -211,6 +225,7 @@ bool config_parse_part(const std::string &content, const std::string &file, conf
 
 bool config_parse(const std::string &content, const std::string &file, config_text *out) {
     std::string reason;
+    // The checks of the whole would report nodes as missing whose lines have errors.
     if (config_parse_part(content, file, out) && !tree_check(out->tree, &reason))
         out->errors = config_complaint(file, out->lines, reason);
     return out->errors.empty();
@@ -223,12 +238,14 @@ std::string config_format(const node_tree &tree, const config_comments &comments
         const auto found = comments.before.find(key);
         return found == comments.before.end() ? std::string() : found->second;
     };
+    // In the order of the tree, the nodes of a section are adjacent.
     for (const auto &[name, text] : tree.set) {
         if (const node_name here = find_section_of(name); here != section) {
             section = here;
             out += std::string(out.empty() ? "" : "\n") + comment("[" + section.text() + "]") + "[" +
                    section.text() + "]\n";
         }
+        // Instances have no line: the section or the children of a nested one create them.
         if (find_schema_row(name)->instance)
             continue;
         out += comment(name.text()) + name.text().substr(section.text().size() + 1) + " = " +

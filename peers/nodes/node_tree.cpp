@@ -49,6 +49,7 @@ void tree_refresh(node_tree *tree) {
         const schema_row *row = find_schema_row(name);
         if (!row)
             continue;
+        // Values that were set come first: emplace leaves them alone when the defaults follow.
         tree->nodes.emplace(name, node_value{row->type, text});
         if (row->instance)
             instances.push_back(name);
@@ -56,6 +57,7 @@ void tree_refresh(node_tree *tree) {
     for (const schema_row &row : schema_rows()) {
         if (!row.fallback)
             continue;
+        // A node that is part of no instance always exists.
         if (!has_wildcard(row.parts)) {
             tree->nodes.emplace(row.parts, node_value{row.type, row.fallback});
             continue;
@@ -63,6 +65,8 @@ void tree_refresh(node_tree *tree) {
         node_name above = row.parts;
         const std::string last = above.parts.back();
         above.parts.pop_back();
+        // Otherwise there is one for each instance that exists. Its pattern is that of the row without the
+        // last part.
         for (const node_name &instance : instances)
             if (matches_pattern(above, instance))
                 tree->nodes.emplace(instance.below(last), node_value{row.type, row.fallback});
@@ -84,6 +88,7 @@ bool check_routers(const node_tree &tree, const node_name &group, std::string *o
     collect_nodes(tree.nodes, list, {false, false, false}, &entries);
     std::set<std::string> seen;
     uint32_t expected = 1;
+    // In numerical order, so that a gap shows at the first number after it.
     for (const auto *entry : entries) {
         const auto &[name, value] = *entry;
         if (value.text != std::to_string(expected++)) {
@@ -96,6 +101,7 @@ bool check_routers(const node_tree &tree, const node_name &group, std::string *o
             *out_reason = name.text() + ": has no ipaddr";
             return false;
         }
+        // Compared as text, which is canonical.
         if (*address == "0.0.0.0" || !seen.insert(*address).second) {
             *out_reason = name.text() + "/ipaddr: " + *address +
                           (*address == "0.0.0.0" ? " is not the address of a router" : " is given twice");
@@ -109,6 +115,7 @@ bool check_masks(const node_tree &tree, const node_name &group, std::string *out
     int bits = 0;
     for (const char *mask : {"mask_src_ip", "mask_dst_ip", "mask_src_port", "mask_dst_port"})
         if (const std::string *text = find_text(tree, group.below(mask)))
+            // The limit is on the sum: each bit doubles the number of values in an assignment.
             bits += std::popcount(std::stoull(*text));
     if (bits <= 7)
         return true;
@@ -124,6 +131,7 @@ bool check_health_argument(const node_tree &tree, const node_name &intercept, st
     if (!kind || !argument || *kind == "tcp")
         return true;
     const bool http = *kind == "http";
+    // A blank would end the path in the request line of HTTP.
     if (!argument->empty() && (!http || argument->find(' ') == std::string::npos))
         return true;
     *out_reason = intercept.below("check").text() + ": " + *kind + " needs " +
@@ -148,6 +156,7 @@ bool tree_check(const node_tree &tree, std::string *out_reason) {
 }
 
 void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk, node_list *out) {
+    // A root and all nodes below it are adjacent in the map, the root first.
     for (auto at = nodes.lower_bound(root); at != nodes.end(); ++at) {
         const bool self = at->first == root;
         if (!self && !at->first.is_under(root))
@@ -157,6 +166,7 @@ void collect_nodes(const node_map &nodes, const node_name &root, tree_walk walk,
         if (!self && !walk.subtree && at->first.parts.size() != root.parts.size() + 1)
             continue;
         const auto next = std::next(at);
+        // The first node below another one follows it immediately.
         if (walk.leaves_only && next != nodes.end() && next->first.is_under(at->first))
             continue;
         out->push_back(&*at);
@@ -173,11 +183,13 @@ commit_result refuse_step(uint32_t code, const std::string &name, const std::str
 
 commit_result remove_step(node_tree *tree, const set_step &step, const node_name &name) {
     const bool instance = find_schema_row(name)->instance;
+    // The root itself need not exist: below a list there may be entries.
     bool found = tree->set.erase(name) > 0;
     for (auto at = tree->set.lower_bound(name); at != tree->set.end() && at->first.is_under(name);) {
         found = true;
         at = tree->set.erase(at);
     }
+    // A value that is not set has its default already; deleting it changes nothing.
     if (!found && instance)
         return refuse_step(LC_NOT_FOUND, step.name, "does not exist");
     return {};
@@ -185,6 +197,7 @@ commit_result remove_step(node_tree *tree, const set_step &step, const node_name
 
 commit_result value_step(node_tree *tree, const set_step &step, const node_name &name,
                          const schema_row &row) {
+    // A value may be sent as a text, whatever the type of the node. An instance may come without one.
     const bool as_text = step.type == bn_type_str || (row.instance && step.type == bn_type_none);
     if (step.type != row.type && !as_text)
         return refuse_step(LC_BAD_TYPE, step.name,
@@ -193,6 +206,7 @@ commit_result value_step(node_tree *tree, const set_step &step, const node_name 
     std::string text, reason;
     if (!check_value(row, name, step.text, &text, &reason))
         return refuse_step(LC_BAD_ARGUMENT, step.name, reason);
+    // Outermost first, and the node itself last if it is an instance.
     for (const node_name &instance : instances_of(name)) {
         if (tree->set.contains(instance))
             continue;
@@ -208,6 +222,7 @@ commit_result value_step(node_tree *tree, const set_step &step, const node_name 
 
 std::vector<node_change> tree_difference(const node_map &before, const node_map &after) {
     std::vector<node_change> changes;
+    // Merges both maps, which have the same order: the smaller name is only in one of them.
     auto a = before.begin();
     auto b = after.begin();
     while (a != before.end() || b != after.end()) {
@@ -237,6 +252,7 @@ std::vector<node_name> find_renewed(const node_tree &before, const std::vector<s
     std::vector<node_name> out;
     for (const set_step &step : steps) {
         node_name name;
+        // The rows exist, because the steps have been applied already.
         if (step.kind == set_kind::remove && parse_node_name(step.name, &name) &&
             find_schema_row(name)->instance && before.nodes.contains(name) && after.nodes.contains(name))
             out.push_back(name);
@@ -247,6 +263,7 @@ std::vector<node_name> find_renewed(const node_tree &before, const std::vector<s
 } // namespace
 
 commit_result tree_prepare(const node_tree &tree, const std::vector<set_step> &steps, node_tree *out_next) {
+    // Only what was set is copied; the rest follows from it.
     out_next->set = tree.set;
     out_next->revision = tree.revision + 1;
     for (const set_step &step : steps) {
@@ -273,6 +290,7 @@ bool tree_check_change(const node_tree &before, const node_tree &after, std::str
         if (!matches_pattern(policy_membership, name))
             continue;
         const node_name policy = policy_groups.below(value.text);
+        // A policy group that has never existed may be named: only the loss of one that is in use is refused.
         if (!before.nodes.contains(policy) || after.nodes.contains(policy))
             continue;
         *out_reason = name.text() + ": policy group " + value.text +

@@ -32,6 +32,7 @@ const char *check_level(std::string *inout) {
     for (const lc_enum_entry *entry = lc_log_level_table; entry->name; entry++)
         if (text == entry->name)
             level = 1;
+    // Where a level may not be empty, the least length of the row refuses it.
     return level || text.empty() ? nullptr : "is not a log level (emerg to debug)";
 }
 
@@ -47,6 +48,7 @@ const char *check_protocol(std::string *inout) {
     const std::string &text = *inout;
     const bool digits = !text.empty() && text.find_first_not_of("0123456789") == std::string::npos;
     if (digits)
+        // The length first: stoi throws on numbers that are too large.
         return text.size() > 3 || std::stoi(text) < 1 || std::stoi(text) > 255 ? "is not between 1 and 255"
                                                                                : nullptr;
     const int number = ip_protocol_by_name(text.c_str());
@@ -58,6 +60,7 @@ const char *check_protocol(std::string *inout) {
 
 const char *check_interface(std::string *inout) {
     const std::string &text = *inout;
+    // The kernel refuses these characters in the name of an interface.
     return text.find_first_of("/ \t:") == std::string::npos ? nullptr : "is not an interface name";
 }
 
@@ -91,6 +94,7 @@ const std::vector<schema_row> rows = [] {
         {GROUP "/router/*/ipaddr", bn_type_ipv4addr, nullptr, 0, 0, nullptr, nullptr, false, true},
         {GROUP "/priority", bn_type_uint32, "200", 0, 255, nullptr, nullptr, false, true},
         {GROUP "/protocol", bn_type_str, "tcp", 1, 31, nullptr, check_protocol, false, true},
+        // Eight bytes are the size of the field in the protocol.
         {GROUP "/password", bn_type_str, "", 0, 8, nullptr, nullptr},
         {GROUP "/encap", bn_type_str, "either", 1, 15, "gre|l2|either", nullptr},
         {GROUP "/weight", bn_type_uint32, "100", 0, 65535, nullptr, nullptr},
@@ -103,6 +107,7 @@ const std::vector<schema_row> rows = [] {
         {GROUP "/hash_src_port", bn_type_bool, "false", 0, 0, nullptr, nullptr},
         {GROUP "/hash_dst_port", bn_type_bool, "false", 0, 0, nullptr, nullptr},
         {GROUP "/mask_src_ip", bn_type_uint32, "0", 0, NUMBER_MAX, nullptr, nullptr},
+        // 0xf00
         {GROUP "/mask_dst_ip", bn_type_uint32, "3840", 0, NUMBER_MAX, nullptr, nullptr},
         {GROUP "/mask_src_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr},
         {GROUP "/mask_dst_port", bn_type_uint16, "0", 0, 65535, nullptr, nullptr},
@@ -135,6 +140,7 @@ const std::vector<schema_row> rows = [] {
         {NODE_SYSTEM_FACILITY, bn_type_uint32, "136", 0, 184, nullptr, check_facility},
         {NODE_SYSLOG "/process/*/log_level", bn_type_str, nullptr, 1, 15, nullptr, check_level},
         {MESSAGES "/all/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level},
+        // Before the general row, because the first row that matches counts: only this file has a default.
         {MAIN_MESSAGES "/override/enable", bn_type_bool, "false", 0, 0, nullptr, nullptr},
         {MESSAGES "/override/enable", bn_type_bool, nullptr, 0, 0, nullptr, nullptr},
         {MESSAGES "/single/*/min_priority", bn_type_str, nullptr, 0, 15, nullptr, check_level},
@@ -273,6 +279,7 @@ const std::vector<const char *> &tunneld_state_nodes() {
 namespace {
 
 bool is_number(const std::string &part) {
+    // 18 digits fit into 64 bits.
     return !part.empty() && part.size() <= 18 && part[0] >= '0' && part[0] <= '9' &&
            part.find_first_not_of("0123456789") == std::string::npos;
 }
@@ -285,6 +292,7 @@ std::strong_ordering compare_parts(const std::string &a, const std::string &b) {
     if (is_number(a))
         if (const auto by_value = std::stoull(a) <=> std::stoull(b); by_value != 0)
             return by_value;
+    // Also for numbers of the same value: "1" and "01" are different names.
     return a.compare(b) <=> 0;
 }
 
@@ -295,6 +303,7 @@ std::strong_ordering operator<=>(const node_name &a, const node_name &b) {
     for (size_t i = 0; i < common; i++)
         if (const auto order = compare_parts(a.parts[i], b.parts[i]); order != 0)
             return order;
+    // A node precedes the nodes below it.
     return a.parts.size() <=> b.parts.size();
 }
 
@@ -331,6 +340,7 @@ bool parse_node_name(const std::string &text, node_name *out) {
     owned_tstr_array split;
     int absolute = 0;
     out->parts.clear();
+    // The functions below take C strings and would silently cut the name.
     if (text.find('\0') != std::string::npos ||
         bn_binding_name_to_parts(text.c_str(), &split.pointer, &absolute) != LC_OK || !absolute)
         return false;
@@ -377,6 +387,7 @@ std::string shown_text(const std::string &text) {
 }
 
 bool canonical_text(uint32_t type, const std::string &text, std::string *out_text) {
+    // A NUL would end the value for the C functions, and the rest would be lost without a word.
     if (text.find('\0') != std::string::npos)
         return false;
     owned_attrib attrib;
@@ -391,6 +402,7 @@ bool canonical_text(uint32_t type, const std::string &text, std::string *out_tex
 namespace {
 
 std::string read_hexadecimal(uint32_t type, const std::string &text) {
+    // At most 16 digits, so that stoull can't overflow. The conversion refuses longer numbers.
     if (!bn_type_numeric(type) || text.size() < 3 || text.size() > 18 || text[0] != '0' ||
         (text[1] != 'x' && text[1] != 'X') ||
         text.find_first_not_of("0123456789abcdefABCDEF", 2) != std::string::npos)
@@ -427,6 +439,7 @@ bool check_instance(const schema_row &row, const std::string &part, std::string 
     std::string kept;
     *out_reason = "\"" + shown_text(part) + "\" ";
     if (!canonical_text(row.type, part, &kept) || kept != part ||
+        // stoll can't throw: the part is a canonical number of the type.
         (numeric && (std::stoll(part) < row.min || std::stoll(part) > row.max))) {
         std::string fault = "is not a number between " + describe_range(row);
         for (const auto &[type, other] : other_instances)
@@ -477,6 +490,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
     }
     if (row.instance) {
         *out_text = name.parts.back();
+        // The value may be repeated, as walks report it.
         if (text.empty() || text == *out_text)
             return true;
         *out_reason = "the value of this node is the last part of its name";
@@ -489,6 +503,7 @@ bool check_value(const schema_row &row, const node_name &name, const std::string
         return false;
     }
     if (bn_type_string(row.type)) {
+        // In bytes: the fields of the daemons have fixed sizes.
         const auto length = static_cast<int64_t>(text.size());
         const bool printable = std::all_of(text.begin(), text.end(),
                                            [](char c) { return static_cast<unsigned char>(c) >= 0x20; });

@@ -33,6 +33,7 @@ std::string join_words(const std::vector<std::string> &words) {
 // --- Ports
 
 bool parse_port(const std::string &text, uint32_t *out) {
+    // Five digits at most, so that stoul can't overflow.
     if (text.empty() || text.size() > 5 || text.find_first_not_of("0123456789") != std::string::npos)
         return false;
     *out = static_cast<uint32_t>(std::stoul(text));
@@ -61,16 +62,19 @@ const char *check_ports(std::string *inout) {
         if (!parse_range(word, &range))
             return "is not a list of ports: write \"all\", or ports and ranges from 1 to 65535 such as 80 "
                    "8000-8080";
+        // Not exchanged silently: it is more likely a mistyped number.
         if (range.first > range.last)
             return "has a range whose first port is greater than its last";
         ranges.push_back(range);
     }
     std::sort(ranges.begin(), ranges.end());
     for (const number_range &range : ranges)
+        // Adjacent ranges are merged too. The numbers are 32 bits wide, and 65535 + 1 is no overflow.
         if (!merged.empty() && range.first <= merged.back().last + 1)
             merged.back().last = std::max(merged.back().last, range.last);
         else
             merged.push_back(range);
+    // Counted after the merge: a long list may have few ranges.
     if (merged.size() > LIST_MAX_ENTRIES)
         return "has more than 64 ranges";
     std::vector<std::string> kept;
@@ -92,7 +96,9 @@ const char *const HOST_BITS = "has host bits that are not zero; write the addres
 
 std::string format_prefix(const number_range &range) {
     owned_text out;
+    // Exact because the range came from a prefix: its size is a power of two.
     const uint32_t mask = ~(range.last - range.first);
+    // The library's prefix is the address in the upper and the mask in the lower 32 bits.
     return lc_ipv4prefix_to_str(uint64_t{range.first} << 32 | mask, &out.pointer) == LC_OK ? out.pointer : "";
 }
 
@@ -151,6 +157,7 @@ const char *check_host_address(std::string *inout) {
     if (lc_str_to_ipv4addr(inout->c_str(), &address) != LC_OK)
         return "is no IPv4 address such as 10.0.0.1";
     const uint32_t first = address >> 24;
+    // Unspecified, loopback, and from 224 multicast and reserved.
     return first == 0 || first == 127 || first >= 224 ? "is not the address of another host" : nullptr;
 }
 
