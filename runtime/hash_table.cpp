@@ -170,6 +170,7 @@ lc_status delete_all_entries(ht *table) {
     lc_status result = LC_OK;
     for (uint32_t i = 0; i < table->bucket_count; i++) {
         while (table->buckets[i]) {
+            // A free function that fails doesn't keep the other entries from being freed.
             const lc_status status = delete_entry(table, &table->buckets[i]);
             if (status != LC_OK)
                 result = status;
@@ -231,6 +232,8 @@ lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value)
     // Deletes an old entry of this key. This may resize the table; therefore the place is looked up only
     // afterwards.
     CHECK_STATUS(ht_delete(table, key, key_length));
+    // Such a table stores copies of key and value; any other keeps the caller's pointers and owns them from
+    // now on.
     if (table->insert_function)
         CHECK_STATUS(table->insert_function(key, length, value, table->user_word, &entry.pointer->key,
                                             &entry.pointer->value));
