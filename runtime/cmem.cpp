@@ -397,7 +397,8 @@ void fill_block_record(cmem_block *block, const cmem_registry *known, const char
     block->diagnostic = 0;
     strlcpy(block->owner, program_invocation_short_name, sizeof block->owner);
     // The name is written last, and its first byte after the others: a process that finds the name, without
-    // any lock, finds the record complete.
+    // any lock, finds the record complete. A record that is taken over has its name already, but also the
+    // same size and key as before.
     strlcpy(block->name + 1, name + 1, sizeof block->name - 1);
     __atomic_store_n(&block->name[0], name[0], __ATOMIC_RELEASE);
 }

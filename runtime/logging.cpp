@@ -92,6 +92,7 @@ lc_status init_with_lock(const char *process_name, const char *prefix, uint32_t 
     state->max_level = static_cast<uint8_t>(max_level);
     state->destinations = destinations;
     state->facility = facility;
+    // Overrides of an earlier call end here; lc_log_save_levels is for a caller that wants to keep them.
     state->override_level = 0;
     state->system_override = state->class_override = 0;
     strlcpy(state->prefix, prefix ? prefix : "", sizeof state->prefix);
