@@ -341,6 +341,7 @@ lc_status gcl_bn_init(gcl *instance) {
     protocol.enabled = 1;
     protocol.session_new = session_new;
     protocol.session_free = session_free;
+    // The catch-all: messages of all types are received in the same way.
     protocol.handlers[0] = {BN_PROTO, 0, receive_frame, nullptr};
     protocol.state = shared;
     CHECK_STATUS(gcl_register_body_protocol(instance, &protocol));

@@ -359,6 +359,7 @@ lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *o
     return LC_OK;
 }
 lc_status write_name(const wire_reader *reader, const wire_name *name, bool escapes, char *out) {
+    // The room at `out` is what measure_name has counted, with the same escapes.
     wire_reader parts = {reader->buffer, name->first, reader->end};
     if (name->leading)
         *out++ = '/';

@@ -100,7 +100,9 @@ lc_status mgmt_client_response(mgmt_client *client, const bn_response_msg *respo
         return LC_OK;
     }
     *client->response_expected = 0;
+    // No message has the id 0; they begin at 1.
     *client->expected_request_id = 0;
+    // The receive path frees the message when its callback returns.
     CHECK_STATUS(bn_response_msg_dup(response, client->captured_response));
     return LC_OK;
 }

@@ -496,6 +496,7 @@ lc_status gcl_session_fd_read_write_timeout_activity(int, uint32_t kind, void *d
     }
     if (status == LC_OK)
         return LC_OK;
+    // The function that failed may have closed the session already.
     if (session->state != GCL_SESSION_CLOSED) {
         LC_LOG(LC_LOG_WARNING, "session %d: closing after error condition", session->id);
         LOG_STATUS(gcl_session_close(session, 0));

@@ -334,6 +334,7 @@ lc_status gcl_session_client_connect_by_sockaddr(gcl_session *session, const soc
     CHECK_STATUS(copy_endpoint(&session->peer, address, length));
     const lc_status status = try_connect(session, retry ? CONNECT_ATTEMPTS : 1);
     if (status != LC_OK) {
+        // try_connect has logged the reason, unless the process is ending.
         abandon_connection(session);
         return status;
     }

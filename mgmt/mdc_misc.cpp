@@ -422,6 +422,7 @@ lc_status add_change(bn_binding_array *bindings, const char *entry_name, bn_bind
         bn_binding_array_get_value_tstr_by_name_rel(bindings, entry_name, "name", nullptr, &name.pointer));
     CHECK_NULL(type.pointer);
     CHECK_NULL(name.pointer);
+    // Either may be absent; which of them a change needs depends on its type.
     const bn_binding *new_value = nullptr, *old_value = nullptr;
     CHECK_STATUS(
         bn_binding_array_get_binding_by_name_rel(bindings, entry_name, "new_attribs/value", &new_value));

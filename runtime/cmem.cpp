@@ -217,6 +217,7 @@ bool load_conf(cmem_registry *fresh) {
         });
     if (error) {
         QV_LOG(LC_LOG_ERR, "%s: cannot read %s, err=%s\n", "cmem_load_conf", CMEM_CONF_PATH, strerror(error));
+        // Entries from before the error are dropped; the next process reads the file from its start.
         memset(static_cast<void *>(fresh->conf), 0, sizeof fresh->conf);
     }
     return error == 0;
@@ -300,7 +301,7 @@ cmem_registry *attach_registry() {
     if (memory == reinterpret_cast<void *>(-1))
         attach_failed();
     cmem_registry *attached = static_cast<cmem_registry *>(memory);
-    // Left unset while another process is stuck in loading, so that the next call waits again.
+    // `registry` stays null while another process is stuck in loading; the next call waits again.
     if (fill_registry(attached))
         registry = attached;
     else

@@ -126,6 +126,7 @@ void set_bucket_count(ht *table, uint32_t bucket_count) {
     for (uint32_t i = 0; i < table->bucket_count; i++) {
         while (ht_entry *entry = table->buckets[i]) {
             table->buckets[i] = entry->next;
+            // The order of a chain doesn't matter: no two of its entries have the same key.
             ht_entry **head = &buckets[table->hash_function(entry->key, entry->key_length) % bucket_count];
             entry->next = *head;
             *head = entry;

@@ -289,6 +289,7 @@ void build_body(line_format *body, const log_line *line, const char *format) {
                 lc_enum_to_string_quiet(lc_log_level_upper_table, line->level));
     if (line->state->prefix[0])
         append_text(body, "%s: ", line->state->prefix);
+    // The caller's format is copied with its conversions, which write_line fills.
     if (line->flags & LC_LOG_FLAG_POSITION)
         append_text(body, "%s(), %s:%d, build %s: %s\n", line->function ? line->function : "",
                     line->file ? line->file : "", line->line, WCCP_BUILD, format);
