@@ -22,6 +22,7 @@ lc_status bn_binding_free(bn_binding **inout) {
         (void)ts_free(&binding->name);
         (void)tstr_array_free(&binding->parts);
         (void)bn_attrib_array_free(&binding->attributes);
+        // A binding inside a block is freed with the last reference to the block.
         if (binding->block_distance)
             bn_block_release(bn_block_of(binding));
         else
@@ -54,6 +55,7 @@ lc_status bn_binding_new_parts_components_takeover(bn_binding **out, tstring **i
         CHECK_STATUS(bn_binding_name_parts_to_name_tstr(parts, absolute, &made_name.pointer));
     else if (!parts)
         CHECK_STATUS(bn_binding_name_to_parts(ts_str(name), &made_parts.pointer, &absolute));
+    // Nothing can fail from here on; what was passed is taken over only now.
     if (made_name.pointer)
         ts_release(name);
     if (made_attributes.pointer)
@@ -113,6 +115,7 @@ lc_status bn_binding_dup(const bn_binding *binding, bn_binding **out) {
     owned<bn_binding, bn_release_binding> copy;
     bn_size_copy(&size, binding);
     CHECK_QUIET(bn_block_new(&size, &builder));
+    // The maker's reference; the copy has one of its own.
     const owned_block held(builder.block);
     CHECK_STATUS(bn_place_copy(&builder, binding, &copy.pointer));
     if (binding->parts)
@@ -176,6 +179,7 @@ lc_status bn_binding_new_str_autoinval(bn_binding **out, const char *name, uint3
                                        uint32_t flags, const char *text) {
     lc_status status = bn_binding_new_str(out, name, id, type, flags, text);
     if (status == LC_BAD_TYPE)
+        // The type is kept, and the mark says that the text had no value in it.
         status = bn_binding_new_str(out, name, id, type, flags | bn_flag_invalid, text);
     CHECK_STATUS(status);
     return LC_OK;
@@ -284,6 +288,7 @@ lc_status bn_binding_get_name_parts(const bn_binding *binding, tstr_array **out_
     int absolute = 0;
     owned<tstr_array, tstr_array_release> parts;
     CHECK_STATUS(bn_binding_name_to_parts(ts_str(binding->name), &parts.pointer, &absolute));
+    // The caller gets the parts without this flag, and takes them for those of an absolute name.
     CHECK_CONDITION(absolute);
     *out_parts = parts.take();
     return LC_OK;

@@ -24,6 +24,7 @@ lc_status bn_text_to_ipprefix(const char *text, lc_ipprefix *out) {
     char address_text[INET6_ADDRSTRLEN];
     const char *slash = strchr(text, '/');
     const size_t length = slash ? static_cast<size_t>(slash - text) : strlen(text);
+    // No address is as long as that.
     if (length >= sizeof address_text)
         return LC_BAD_TYPE;
     memcpy(address_text, text, length);
@@ -101,6 +102,7 @@ lc_status read_ipv4(const char *text, uint32_t *out, const char **out_rest) {
         if (!isdigit(static_cast<unsigned char>(*text)))
             return LC_BAD_TYPE;
         char *end = nullptr;
+        // Decimal also with leading zeros, unlike inet_aton(), which would read an octal number.
         const unsigned long value = strtoul(text, &end, 10);
         if (value > 255)
             return LC_BAD_TYPE;
@@ -150,6 +152,7 @@ lc_status lc_ipv4prefix_to_str(uint64_t value, char **out) {
     CHECK_NULL(out);
     const auto address = static_cast<uint32_t>(value >> 32);
     const auto mask = static_cast<uint32_t>(value);
+    // A mask with gaps is shown by its leading ones.
     return bn_give_text(smprintf("%u.%u.%u.%u/%d", address >> 24, (address >> 16) & 255, (address >> 8) & 255,
                                  address & 255, std::countl_one(mask)),
                         out);
@@ -172,6 +175,8 @@ lc_status lc_str_to_macaddr802(const char *text, lc_macaddr802 *out) {
         const size_t bytes = digits > 2 ? 2 : 1;
         if (digits == 0 || filled + bytes > sizeof value.bytes)
             return LC_BAD_TYPE;
+        // If this reads further than the digits counted, what follows them isn't a colon, and the text is
+        // refused.
         const unsigned long group = strtoul(text, nullptr, 16);
         if (bytes == 2)
             value.bytes[filled++] = static_cast<uint8_t>(group >> 8);

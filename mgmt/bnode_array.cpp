@@ -169,12 +169,13 @@ lc_status begin_walk(pattern_walk *walk, const bn_binding_array *array, const ch
     CHECK_STATUS(bn_pattern_init(&walk->pattern, pattern));
     walk->array = array;
     walk->next = first;
+    // Without memory for the literal text every name is compared with the pattern.
     const bool narrowed = bn_pattern_literal_start(&walk->pattern, &walk->start.pointer);
     walk->in_order = narrowed && array->list->sorted;
     if (!walk->in_order)
         return LC_OK;
-    uint32_t low = 0,
-             high = array->list->length; // searches the first name that isn't less than the literal text
+    // Searches for the first name that isn't less than the literal text.
+    uint32_t low = 0, high = array->list->length;
     while (low < high) {
         const uint32_t middle = low + (high - low) / 2;
         const bn_binding *binding = bn_binding_array_get_quick(array, middle);

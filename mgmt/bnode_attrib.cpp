@@ -37,6 +37,7 @@ lc_status bn_attrib_free_value(bn_attrib *attrib) {
         (void)ts_free(&attrib->value.string);
     if (owns_binary(attrib))
         (void)tb_free(&attrib->value.binary);
+    // Also clears the freed pointer: freeing the value again does nothing.
     memset(attrib->value.bytes, 0, sizeof attrib->value.bytes);
     attrib->value_size = 0;
     return LC_OK;
@@ -56,6 +57,7 @@ lc_status bn_attrib_dup(const bn_attrib *attrib, bn_attrib **out) {
     CHECK_NULL(attrib);
     owned<bn_attrib, bn_release_attrib> copy;
     CHECK_STATUS(bn_attrib_new(&copy.pointer));
+    // This copies a pointer as well; it is cleared below before anything can fail.
     *copy.pointer = *attrib;
     if (owns_text(attrib)) {
         memset(&copy.pointer->value, 0, sizeof copy.pointer->value);
@@ -73,6 +75,7 @@ void bn_attrib_place_value(bn_attrib *attrib, char *text, uint32_t length) {
     if (owns_text(attrib)) {
         auto *placed = &attrib->value.placed_string;
         ts_place(&placed->record, text, static_cast<int32_t>(length));
+        // From here on the attribute points into itself, and must not be moved.
         placed->string = &placed->record;
     } else {
         auto *placed = &attrib->value.placed_binary;
@@ -96,6 +99,7 @@ int compare_attributes(const bn_attrib *a, const bn_attrib *b) {
     if (!a || !b)
         return (a ? 0 : 1) - (b ? 0 : 1);
     const bool a_invalid = a->type_flags & bn_flag_invalid, b_invalid = b->type_flags & bn_flag_invalid;
+    // A valid attribute sorts before an invalid one; two invalid ones are equal.
     if (a_invalid || b_invalid)
         return a_invalid - b_invalid;
     if (a->type != b->type)
@@ -152,6 +156,7 @@ lc_status bn_attrib_set_str(bn_attrib *attrib, uint32_t id, uint32_t type, uint3
         return LC_OK;
     }
     CHECK_NULL(text);
+    // Only the allocated types have an empty text as a value.
     if (!*text && type < bn_type_str)
         return LC_BAD_TYPE;
     bn_attrib made{};
@@ -174,6 +179,7 @@ lc_status bn_attrib_new_str(bn_attrib **out, uint32_t id, uint32_t type, uint32_
     owned<bn_attrib, bn_release_attrib> attrib;
     CHECK_STATUS(bn_attrib_new(&attrib.pointer));
     const lc_status status = bn_attrib_set_str(attrib.pointer, id, type, flags, text);
+    // The caller reports bad input; it isn't logged on the way.
     if (status == LC_BAD_TYPE)
         return status;
     CHECK_STATUS(status);
@@ -202,6 +208,7 @@ lc_status bn_attrib_get_str(const bn_attrib *attrib, uint32_t *out_id, uint32_t 
     get_id_and_type(attrib, out_id, out_type_and_flags);
     if (expected_type && expected_type != attrib->type)
         return LC_ASSERTION;
+    // The bytes of such a value have no meaning, and its type may have no text for them.
     if (attrib->type_flags & bn_flag_no_value) {
         *out_text = safe_strdup("");
         CHECK_NULL(*out_text);

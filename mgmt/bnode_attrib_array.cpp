@@ -22,6 +22,8 @@ bn_attrib *find_attrib(const bn_attrib_array *array, uint32_t id) {
     return at < array->count && array->slots[at].id == id ? array->slots[at].attrib : nullptr;
 }
 void free_attrib_slot(bn_attrib_slot *slot) {
+    // The record of a placed attribute belongs to its block, but its value may have been replaced by one that
+    // doesn't.
     if (slot->placed)
         (void)bn_attrib_free_value(slot->attrib);
     else
@@ -63,6 +65,7 @@ lc_status reserve_attrib_slots(bn_attrib_array *array, uint32_t count) {
     if (count <= array->capacity)
         return LC_OK;
     const uint32_t capacity = std::max(count, array->capacity * 2);
+    // Slots inside a block can't be reallocated; they are copied.
     auto *slots = static_cast<bn_attrib_slot *>(
         realloc(array->placed_slots ? nullptr : array->slots, capacity * sizeof(bn_attrib_slot)));
     CHECK_NULL(slots);
@@ -103,6 +106,7 @@ lc_status bn_attrib_array_get(const bn_attrib_array *array, uint32_t id, bn_attr
     CHECK_NULL(out);
     *out = nullptr;
     CHECK_NULL(array);
+    // An id past the end is a failure; an empty slot isn't.
     if (id >= array->length)
         return LC_NOT_FOUND;
     *out = find_attrib(array, id);

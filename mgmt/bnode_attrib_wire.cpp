@@ -60,6 +60,7 @@ lc_status put_sized(tbuffer *buffer, uint32_t offset, const void *bytes, uint32_
 lc_status put_value(const bn_type_row *row, const bn_attrib *attrib, tbuffer *buffer, uint32_t offset,
                     uint32_t *out) {
     if (row->shape == value_shape::text) {
+        // Null for an attribute without a value, which is sent with length 0.
         const tstring *text = attrib->value.string;
         const uint32_t length = text ? static_cast<uint32_t>(text->length) : 0;
         return put_sized(buffer, offset, ts_str_maybe(text), length, out);
@@ -140,6 +141,7 @@ lc_status bn_check_text(const uint8_t *bytes, uint32_t length) {
 namespace {
 
 lc_status check_type(uint32_t found, uint32_t expected) {
+    // 0 leaves the type to the receiver that expects a certain one.
     if (found == expected || found == 0)
         return LC_OK;
     LC_LOG(LC_LOG_ERR, "Attribute of type %s, expected %s",
@@ -192,6 +194,7 @@ lc_status bn_wire_locate(const tbuffer *buffer, uint32_t offset, uint32_t type, 
     if (load_be32(at) != row->wire.kind)
         FAIL_WITH(LC_GENERIC);
     CHECK_QUIET(check_type(type_found, type));
+    // Flags in the low 16 bits, where the type is in a type word, are dropped.
     *out = {row, load_be32(at + 4), load_be32(at + 12) & ~BN_TYPE_MASK, nullptr, 0, 0};
     CHECK_CONDITION(bn_attrib_id_valid(out->id));
     CHECK_QUIET(locate_value(out, at + HEADER_SIZE, buffer->length - offset - HEADER_SIZE));
@@ -207,6 +210,7 @@ namespace {
 
 void fill_in_place(const bn_wire_attrib *found, bn_attrib *out) {
     const uint32_t leading = found->row->wire.leading;
+    // An invalid attribute keeps the size of its type, an absent one has the size 0.
     if (!(found->flags & bn_flag_absent))
         out->value_size = found->row->size;
     if (!has_value(found->flags))

@@ -20,6 +20,7 @@ constexpr size_t in_grains(size_t bytes) {
 constexpr size_t HEAD = in_grains(sizeof(bn_block));
 
 void bn_block_release(bn_block *block) {
+    // acq_rel: what the other holders have done with the block happens before it is freed.
     if (block && block->holders.fetch_sub(1, std::memory_order_acq_rel) == 1)
         free(block);
 }
@@ -34,6 +35,7 @@ void bn_size_text(bn_block_size *size, size_t length) {
 }
 void bn_size_binding(bn_block_size *size, size_t name_length, bool bare, uint32_t attributes) {
     bn_size_record(size, sizeof(bn_binding));
+    // Only the first of the bindings with this bare name needs a string.
     if (!bare || !size->bare[name_length]) {
         bn_size_record(size, sizeof(tstring));
         bn_size_text(size, name_length);
@@ -100,6 +102,7 @@ void *bn_place_record(bn_block_builder *builder, size_t bytes) {
 }
 char *bn_place_text(bn_block_builder *builder, size_t length) {
     char *text = builder->text;
+    // ">=", since the NUL needs a byte too.
     if (length >= static_cast<size_t>(builder->texts_end - text))
         return nullptr;
     builder->text += length + 1;
@@ -119,6 +122,7 @@ lc_status bn_place_string(bn_block_builder *builder, const char *bytes, size_t l
 namespace {
 
 lc_status place_bare(bn_block_builder *builder, size_t length, tstring **out) {
+    // All bindings with this name share the string, since names are replaced, never changed in place.
     tstring **shared = &builder->bare[length];
     if (!*shared)
         // Of length 0 or 1.
@@ -179,6 +183,7 @@ lc_status place_value(bn_block_builder *builder, const bn_attrib *from, bn_attri
     const tstring *string = string_value_of(from);
     const tbuffer *binary = binary_value_of(from);
     if (!string && !binary) {
+        // A value in place, or none; copying the record is enough.
         *to = *from;
         return LC_OK;
     }
@@ -208,6 +213,7 @@ lc_status bn_place_copy(bn_block_builder *builder, const bn_binding *binding, bn
                                  binding->absolute != 0, count, &copy.pointer, &text));
     if (text)
         memcpy(text, name->buffer, static_cast<size_t>(name->length));
+    // Without attributes this takes no room, but isn't null either.
     auto *attribs = static_cast<bn_attrib *>(bn_place_record(builder, count * sizeof(bn_attrib)));
     CHECK_NULL(attribs);
     for (uint32_t i = 0; i < count; i++) {

@@ -11,6 +11,7 @@
 constexpr char SEPARATOR = '/', ESCAPE = '\\';
 
 const char *bn_part_end(const char *part) {
+    // An escaped character is skipped together with its backslash; it may be a separator.
     for (; *part && *part != SEPARATOR; part++)
         part += bn_escapes(part);
     return part;
@@ -61,6 +62,7 @@ lc_status bn_binding_name_to_parts(const char *name, tstr_array **out_parts, int
         const uint32_t copied = copy_part(part, end, text);
         ts_place(&records[i], text, static_cast<int32_t>(copied));
         text += copied + 1;
+        // After the last part this is past the NUL, and isn't used any more.
         part = end + 1;
     }
     return LC_OK;
@@ -110,6 +112,7 @@ bool bn_pattern_matches(const bn_pattern *pattern, const char *name) {
     if ((*name == SEPARATOR) != (pattern->absolute != 0))
         return false;
     name += *name == SEPARATOR;
+    // Without parts on one side, both must be without.
     if (!*name || !wanted_count)
         return !*name && !wanted_count;
     for (uint32_t i = 0; i < wanted_count; i++) {

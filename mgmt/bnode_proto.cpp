@@ -51,6 +51,7 @@ uint16_t bn_request_msg_response_msg_type(uint16_t request_type) {
     case bn_msg_set_request:
     case bn_msg_action_request:
     case bn_msg_event:
+        // The response to a type always has the next number.
         return static_cast<uint16_t>(request_type + 1);
     default:
         LC_LOG(LC_LOG_WARNING, "Request message had unrecognized message type: %d", request_type);
@@ -64,6 +65,7 @@ void bn_request_node_free(bn_request_node *node) {
     if (!node)
         return;
     (void)bn_binding_free(&node->binding);
+    // Both are null except in a set request that moves a node.
     ts_free(&node->source);
     ts_free(&node->target);
     if (!node->placed)
@@ -127,6 +129,7 @@ lc_status bn_request_msg_free(bn_request_msg **inout) {
     ts_free(&(*inout)->audit_user);
     ts_free(&(*inout)->text);
     (void)bn_request_per_node_array_free(&(*inout)->nodes);
+    // Last: the nodes, and what they contain, may be in the block.
     bn_block_release((*inout)->block);
     free(*inout);
     *inout = nullptr;
@@ -203,6 +206,7 @@ lc_status append_node(bn_request_msg *msg, uint16_t type, uint32_t subop, uint32
     node.pointer->subop = subop;
     node.pointer->flags = flags;
     node.pointer->binding = *inout_binding;
+    // The node owns the binding from here on, also if it can't be appended.
     *inout_binding = nullptr;
     CHECK_STATUS(bn_request_per_node_array_append_takeover(msg->nodes, &node.pointer));
     if (out_node_id)
@@ -240,6 +244,8 @@ lc_status bn_query_request_msg_append_with_attribs(bn_request_msg *msg, uint32_t
     CHECK_NULL(node_name);
     CHECK_CONDITION(msg->msg_type == bn_msg_query_request);
     owned_binding binding;
+    // Registration info carries the values of its attributes; any other query only names the attributes that
+    // it asks for.
     if (attributes && subop == bn_query_registration_info) {
         CHECK_STATUS(bn_binding_new_components(&binding.pointer, node_name, attributes));
     } else {
@@ -409,6 +415,7 @@ lc_status copy_node(const bn_response_node *node, bn_block_builder *builder, bn_
     copy.pointer->msg_type = node->msg_type;
     if (node->binding)
         CHECK_STATUS(bn_place_copy(builder, node->binding, &copy.pointer->binding));
+    // A placed copy comes without parts. If they were made already, splitting the name again is avoided.
     if (node->binding && node->binding->parts)
         CHECK_STATUS(tstr_array_duplicate(node->binding->parts, &copy.pointer->binding->parts));
     CHECK_STATUS(bn_response_per_node_array_append_takeover(out->nodes, &copy.pointer));
@@ -440,6 +447,7 @@ lc_status bn_response_msg_dup(const bn_response_msg *msg, bn_response_msg **out)
     CHECK_NULL(msg);
     owned_response copy;
     CHECK_STATUS(bn_response_msg_new(&copy.pointer, msg->msg_type));
+    // The pointers are cleared at once, so that a failure doesn't free what belongs to the original.
     *copy.pointer = *msg;
     copy.pointer->return_message = nullptr;
     copy.pointer->nodes = nullptr;
@@ -479,6 +487,7 @@ struct reading {
 lc_status begin_reading(reading *into, uint32_t count) {
     array_options options = {};
     CHECK_STATUS(array_options_get_defaults(&options));
+    // The slots hold the ids themselves.
     options.duplicate = array_std_assign_func;
     options.initial_size = count ? count : 1;
     CHECK_STATUS(uint32_array_new_full(&into->ids.pointer, &options));
@@ -498,6 +507,7 @@ lc_status copy_bindings(const NodeArray *nodes, uint32_t count, Get get, int kee
             bn_size_copy(&size, binding);
     bn_block_builder builder;
     CHECK_STATUS(bn_block_new(&size, &builder));
+    // All copies are in one block, each with a reference to it; this is the maker's.
     const owned_block held(builder.block);
     for (uint32_t i = 0; i < count; i++) {
         const bn_binding *binding = get(nodes, i)->binding;
@@ -528,6 +538,7 @@ lc_status bn_request_get(const bn_request_msg *msg, uint16_t *out_type, const vo
     if (out_node_info)
         *out_node_info = nullptr;
     CHECK_NULL(msg);
+    // Requests have odd numbers.
     if (msg->msg_type % 2 == 0 || msg->msg_type > bn_msg_event)
         FAIL_WITH(LC_UNEXPECTED_CASE);
     const uint32_t count = bn_request_per_node_array_length_quick(msg->nodes);
@@ -547,6 +558,7 @@ lc_status bn_request_get(const bn_request_msg *msg, uint16_t *out_type, const vo
     if (out_type)
         *out_type = msg->msg_type;
     if (out_body)
+        // The body begins with the flags.
         *out_body = &msg->flags;
     if (out_bindings)
         *out_bindings = read.bindings.take();
@@ -573,6 +585,7 @@ lc_status move_bindings(const bn_response_msg *msg, uint32_t count, int keep_par
     for (uint32_t i = 0; i < count; i++) {
         bn_response_node *node = bn_response_per_node_array_get_quick(msg->nodes, i);
         if (node->binding)
+            // This leaves the node without a binding; such a node is skipped wherever nodes are read.
             CHECK_STATUS(append_to_reading(into, &node->binding, keep_parts));
     }
     return LC_OK;

@@ -24,6 +24,8 @@ struct dump_names {
 
 bool is_level_wanted(int32_t level) {
     int32_t maximum = 0;
+    // The system level decides whether there is a dump at all. Each line is tested once more, since the
+    // process may have a level of its own.
     return level != -1 && lc_log_get_max_log_level(&maximum) == LC_OK && maximum >= level;
 }
 

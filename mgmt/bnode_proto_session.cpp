@@ -141,6 +141,7 @@ struct response_sending {
 lc_status add_audit_user(gcl_session *session, bn_request_msg *msg) {
     const bn_instance_state *state = instance_state(gcl_session_get_instance(session));
     const bool audited = msg->msg_type == bn_msg_set_request || msg->msg_type == bn_msg_action_request;
+    // Only these two can change something.
     if (audited && state->audit_user && !msg->audit_user)
         CHECK_STATUS(ts_dup(state->audit_user, &msg->audit_user));
     return LC_OK;
@@ -180,6 +181,7 @@ lc_status send_refusal(gcl_session *session, const bn_response_msg *msg, lc_stat
                                reason == LC_NO_BUFFER_SPACE
                                    ? BN_TOO_LARGE
                                    : "The session's output queue is full: ask for less, or try again later"));
+    // The same ids, so that the peer takes the refusal as the answer to its request.
     refusal.pointer->service_id = msg->service_id;
     refusal.pointer->msg_id = msg->msg_id;
     refusal.pointer->transaction_id = msg->transaction_id;
@@ -245,6 +247,8 @@ lc_status receive_request(gcl_session *session, uint16_t mtype, tbuffer **inout_
                kind_word(type));
         return LC_OK;
     }
+    // What a callback returns doesn't affect the session: a request that can't be carried out is no reason to
+    // close it.
     (void)callback.request(session, msg.pointer, callback.data);
     return LC_OK;
 }
@@ -290,8 +294,10 @@ lc_status receive_frame(gcl_session *session, gcl_body_protocol *protocol, tbuff
     CHECK_CONDITION(tb_length(frame.pointer) >= static_cast<int32_t>(BN_FRAME_HEADER_BYTES));
     CHECK_NULL(session_state(session));
     gcl_frame_header header;
+    // The frame reader has converted the header to host order.
     memcpy(&header, tb_buf(frame.pointer), sizeof header);
     CHECK_CONDITION(header.proto == protocol->protocol);
+    // An invalid type is handled like a request; check_types then refuses it without ending the session.
     const bool response =
         header.mtype % 2 == 0 && header.mtype >= bn_msg_query_response && header.mtype <= bn_msg_event_ack;
     CHECK_STATUS(response ? receive_response(session, header.mtype, &frame.pointer)
@@ -306,6 +312,8 @@ lc_status session_new(gcl_session *session, gcl_body_protocol *protocol) {
     CHECK_NULL(shared);
     owned<void, bn_free_memory> state(calloc(1, sizeof(bn_session_state)));
     CHECK_NULL(state.pointer);
+    // From here on the session has its own copies; changes of the instance's callbacks affect later sessions
+    // only.
     memcpy(static_cast<bn_session_state *>(state.pointer)->callbacks, shared->callbacks,
            sizeof shared->callbacks);
     CHECK_STATUS(gcl_session_set_protocol_state(session, BN_PROTO, state.pointer));
@@ -333,6 +341,7 @@ lc_status gcl_bn_init(gcl *instance) {
     protocol.enabled = 1;
     protocol.session_new = session_new;
     protocol.session_free = session_free;
+    // The catch-all: messages of all types are received in the same way.
     protocol.handlers[0] = {BN_PROTO, 0, receive_frame, nullptr};
     protocol.state = shared;
     CHECK_STATUS(gcl_register_body_protocol(instance, &protocol));

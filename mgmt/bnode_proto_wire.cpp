@@ -94,6 +94,7 @@ uint32_t bytes_used(const tbuffer *buffer) {
 
 // Writes one part of a name without its escapes, in runs of bytes that need no change.
 lc_status put_unescaped_part(tbuffer *buffer, const char *part, const char *end) {
+    // The length is known only after the escapes have been removed.
     const uint32_t length_at = bytes_used(buffer);
     CHECK_STATUS(put_u32(buffer, 0));
     const char *run = part;
@@ -245,6 +246,7 @@ lc_status get_string(wire_reader *reader, tstring **out) {
     wire_text found = {};
     CHECK_STATUS(locate_checked_text(reader, &found));
     CHECK_STATUS(ts_new_size(out, found.length + 1));
+    // This would stop at a NUL, but a checked text contains none.
     CHECK_STATUS(ts_append_str_frag(*out, reinterpret_cast<const char *>(found.bytes), 0,
                                     static_cast<int32_t>(found.length)));
     return LC_OK;
@@ -322,6 +324,8 @@ size_t write_escaped(const wire_text *part, bool separated, char *out) {
     return length;
 }
 lc_status measure_part(const wire_text *part, bool separated, message_extent *extent, size_t *inout_length) {
+    // Only the first pass looks for them. From the first name with a special character on, lengths are
+    // counted with escapes; for all other names that makes no difference.
     if (!extent->checked && has_special(part)) {
         CHECK_STATUS(bn_check_text(part->bytes, part->length));
         extent->escapes = true;
@@ -338,6 +342,8 @@ lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *o
     // One separator between two parts.
     out->length = out->parts ? out->parts - 1 : 0;
     bool first_is_empty = false;
+    // The number of parts may be false, but each takes at least its length word: the loop ends with the
+    // buffer.
     for (uint32_t i = 0; i < out->parts; i++) {
         wire_text part = {};
         CHECK_STATUS(locate_text(reader, &part));
@@ -353,6 +359,7 @@ lc_status measure_name(wire_reader *reader, message_extent *extent, wire_name *o
     return LC_OK;
 }
 lc_status write_name(const wire_reader *reader, const wire_name *name, bool escapes, char *out) {
+    // The room at `out` is what measure_name has counted, with the same escapes.
     wire_reader parts = {reader->buffer, name->first, reader->end};
     if (name->leading)
         *out++ = '/';
@@ -402,6 +409,7 @@ lc_status place_attribute(wire_reader *reader, bn_block_builder *builder, bn_att
         memcpy(text, found.value, found.length);
     }
     bn_wire_fill(&found, text, attrib);
+    // If the id occurs twice, the later attribute counts, and the earlier record stays in the block unused.
     CHECK_STATUS(bn_attrib_array_put_placed(array, found.id, attrib));
     return LC_OK;
 }
@@ -415,6 +423,7 @@ lc_status place_binding(wire_reader *reader, message_extent *extent, bn_block_bu
     char *text = nullptr;
     CHECK_STATUS(
         bn_place_binding(builder, name.length, name.bare, name.absolute, count, &binding.pointer, &text));
+    // A bare name has been written already.
     if (text)
         CHECK_STATUS(write_name(reader, &name, extent->escapes, text));
     for (uint32_t i = 0; i < count; i++)
@@ -556,12 +565,14 @@ lc_status serialize_message(typename Kind::message *msg, uint32_t header_bytes, 
     msg->length = 0;
     CHECK_STATUS(tb_append_buf(bytes, &header, sizeof header));
     CHECK_STATUS(put_message_head(bytes, msg));
+    // The count is filled in after the nodes, since not all of them may be written.
     const uint32_t count_at = bytes_used(bytes);
     CHECK_STATUS(put_u32(bytes, 0));
     uint32_t written = 0;
     const uint32_t count = Kind::node_count(msg->nodes);
     for (uint32_t i = 0; i < count; i++) {
         const auto *node = Kind::node_at(msg->nodes, i);
+        // A node whose binding has been moved out is left out and not counted.
         if (!node || !node->binding)
             continue;
         CHECK_STATUS(put_u32(bytes, node->node_id));
@@ -640,6 +651,7 @@ lc_status deserialize_message(const tbuffer *buffer, uint32_t offset, typename K
     CHECK_STATUS(measure_nodes<Kind>(&reader, count, &trailers, &extent));
     if (trailers.get_message)
         CHECK_STATUS(trailers.get_message(&reader, msg.pointer));
+    // The count can be trusted now: the first pass has read that many nodes.
     CHECK_STATUS(Kind::new_nodes(&msg.pointer->nodes, count));
     if (count)
         CHECK_STATUS(place_nodes<Kind>(&nodes, count, &trailers, &extent, msg.pointer));

@@ -94,6 +94,7 @@ namespace {
 
 void store_number(const bn_type_row *row, uint64_t value, bn_attrib *attrib) {
     static_assert(std::endian::native == std::endian::little);
+    // The low bytes come first, so that a shorter type gets the low part of the value.
     memcpy(attrib->value.bytes, &value, std::min<size_t>(row->size, sizeof value));
 }
 
@@ -102,6 +103,7 @@ lc_status natural_to_text(const bn_type_row *row, const bn_attrib *attrib, char 
 }
 lc_status natural_from_text(const bn_type_row *row, const char *text, bn_attrib *attrib) {
     uint64_t value = 0;
+    // The limit has as many ones as the type has bits.
     CHECK_QUIET(bn_text_to_natural(text, UINT64_MAX >> (64 - 8 * row->size), &value));
     store_number(row, value, attrib);
     return LC_OK;
@@ -142,6 +144,7 @@ lc_status real_from_text(const bn_type_row *, const char *text, bn_attrib *attri
     char *end = nullptr;
     errno = 0;
     const Real value = parse_real<Real>(text, &end);
+    // errno is set for an underflow too; such a text is refused instead of becoming 0.
     if (errno || end == text || *end || isspace(static_cast<unsigned char>(*text)))
         return LC_BAD_TYPE;
     memcpy(attrib->value.bytes, &value, sizeof value);
@@ -267,6 +270,7 @@ lc_status ipv6prefix_to_str(const lc_ipv6prefix *value, char **out) {
 }
 lc_status text_to_ipv6prefix(const char *text, lc_ipv6prefix *out) {
     lc_ipprefix prefix{};
+    // The general conversion also takes IPv4 and a missing length.
     if (!strchr(text, ':') || !strchr(text, '/') || bn_text_to_ipprefix(text, &prefix) != LC_OK)
         return LC_BAD_TYPE;
     memcpy(out->address, prefix.address, sizeof out->address);
@@ -312,6 +316,7 @@ lc_status hostname_from_text(const bn_type_row *row, const char *text, bn_attrib
 }
 lc_status binary_to_text(const bn_type_row *, const bn_attrib *attrib, char **out) {
     const tbuffer *bytes = attrib->value.binary;
+    // A buffer always has a NUL after its last byte; the text ends at the first one.
     return bn_give_text(safe_strdup(bytes ? reinterpret_cast<const char *>(bytes->buffer) : ""), out);
 }
 lc_status binary_from_text(const bn_type_row *, const char *text, bn_attrib *attrib) {
@@ -323,6 +328,8 @@ lc_status binary_from_text(const bn_type_row *, const char *text, bn_attrib *att
 // --- The table
 
 using shape = value_shape;
+// The columns are those of bn_type_row. Durations are numeric; dates and times are not. Only "any", which no
+// attribute has, is without a wire form.
 constexpr bn_type_row rows[] = {
     {bn_type_uint8, "uint8", 1, shape::natural, true, natural_to_text, natural_from_text, wire_number,
      nullptr},

@@ -33,12 +33,14 @@ lc_status connect_to_mgmtd(gcl_session *session) {
 lc_status mgmt_client_open(mgmt_client *client, const char *client_name, mdc_send_function msg_handler) {
     CHECK_STATUS(gcl_session_client_new(*client->instance, client_name, nullptr, 0, client->session));
     CHECK_QUIET(connect_to_mgmtd(*client->session));
+    // Body protocol 2, bnode, uses service 2.
     CHECK_STATUS(gcl_session_client_open_service_blocking(*client->session, 2, 2, nullptr, 0, -1));
     CHECK_STATUS(mdc_init(msg_handler, nullptr, nullptr, nullptr, *client->session, client->handle));
     return LC_OK;
 }
 
 void mgmt_client_deinit(mgmt_client *client) {
+    // In this order, since closing a session removes its interests, which the bridge passes to the loop.
     LOG_STATUS(gcl_deinit(client->instance));
     *client->session = nullptr;
     mdc_free(client->handle);
@@ -68,6 +70,7 @@ lc_status mgmt_client_request(mgmt_client *client, bn_request_msg *request, bn_r
     // a mistake of the caller, and is logged.
     if (*client->response_expected)
         (void)lc_check_condition(__func__, LC_FILE_NAME, __LINE__);
+    // Setting this after sending is early enough: the answer is read by this thread, in the loop below.
     *client->response_expected = 1;
     *client->expected_request_id = bn_request_get_msg_id(request);
     (void)bn_response_msg_free(client->captured_response);
@@ -78,6 +81,7 @@ lc_status mgmt_client_request(mgmt_client *client, bn_request_msg *request, bn_r
     *out_response = *client->captured_response;
     *client->captured_response = nullptr;
     *client->response_expected = 0;
+    // An answer that has arrived is returned even if the exit has begun.
     return status == LC_OK && !*out_response && exit_has_begun(client) ? LC_CANCELLED : status;
 }
 
@@ -96,7 +100,9 @@ lc_status mgmt_client_response(mgmt_client *client, const bn_response_msg *respo
         return LC_OK;
     }
     *client->response_expected = 0;
+    // No message has the id 0; they begin at 1.
     *client->expected_request_id = 0;
+    // The receive path frees the message when its callback returns.
     CHECK_STATUS(bn_response_msg_dup(response, client->captured_response));
     return LC_OK;
 }

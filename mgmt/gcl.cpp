@@ -138,6 +138,8 @@ lc_status gcl_shutdown(gcl *instance) {
         const lc_status status = gcl_session_close(session, 0);
         LOG_STATUS(status);
         result = result ? result : status;
+        // Closed sessions stay in the list and are skipped. One that can't be closed must not be tried
+        // forever.
         session = status ? session->next : instance->sessions;
     }
     return result;
@@ -149,6 +151,7 @@ lc_status gcl_deinit(gcl **inout) {
     if (!instance)
         return LC_OK;
     const cancel_off_guard cancel_off;
+    // Null if gcl_init failed before it was created. The guard's scope ends before the lock is destroyed.
     if (instance->lock) {
         const lc_lock_guard guard(instance->lock);
         // Until the list is empty: a close handler may have freed the session, or made another one.
@@ -161,6 +164,7 @@ lc_status gcl_deinit(gcl **inout) {
         }
         LOG_STATUS(bn_deinit(instance));
     }
+    // No thread can be waiting for the lock of such a session any more.
     while (gcl_session *session = instance->freed) {
         instance->freed = session->next;
         gcl_forget_record(session);
@@ -193,6 +197,7 @@ lc_status gcl_session_set_protocol_state(gcl_session *session, uint16_t protocol
 }
 int gcl_session_service_is_open(gcl_session *session, int32_t service) {
     const gcl_admin *admin = session ? gcl_admin_of(session) : nullptr;
+    // The service comes from the peer; it is compared before it is used as the number of a bit.
     return admin && service >= GCL_SERVICE_MIN && service <= GCL_SERVICE_MAX &&
            (admin->open_services >> service & 1u);
 }

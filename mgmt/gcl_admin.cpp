@@ -39,6 +39,7 @@ lc_status copy_body(const tbuffer *frame, Layout *out) {
 lc_status admin_session_new(gcl_session *session, gcl_body_protocol *) {
     auto *admin = static_cast<gcl_admin *>(calloc(1, sizeof(gcl_admin)));
     CHECK_NULL(admin);
+    // The state stays 0 until the session is connected.
     admin->uid = session->uid;
     admin->gid = session->gid;
     memcpy(admin->user, session->user, sizeof admin->user);
@@ -98,6 +99,7 @@ bool log_bad_ids(const gcl_session *session, int32_t uid, int32_t gid, uid_t wan
 bool listener_is_trusted(const gcl_session *session) {
     ucred listener{};
     socklen_t length = sizeof listener;
+    // On the connecting side these are the ids that the peer had when it called listen().
     if (getsockopt(session->fd, SOL_SOCKET, SO_PEERCRED, &listener, &length) != 0) {
         LC_LOG(LC_LOG_ERR, "getsockopt SO_PEERCRED: %m");
         return false;
@@ -129,6 +131,7 @@ bool peer_is_trusted(const gcl_session *session, int32_t *inout_uid, int32_t *in
                gid);
         return false;
     }
+    // Nothing on a TCP connection proves the ids.
     if (session->family != AF_UNIX)
         return true;
     uid_t wanted_uid = geteuid();
@@ -167,6 +170,7 @@ lc_status receive_greeting(gcl_session *session, gcl_body_protocol *, tbuffer **
                admin->state, GCL_ADMIN_GREETING_AWAITED);
         return refuse_peer(session);
     }
+    // The answer is sent before the peer is checked; it contains nothing but our name and ids.
     if (session->state == GCL_SESSION_CONNECTED) {
         CHECK_STATUS(send_greeting_response(session, admin));
     } else {
@@ -239,6 +243,8 @@ lc_status receive_open_response(gcl_session *session, gcl_body_protocol *, tbuff
         admin->state = GCL_ADMIN_OPEN_ANSWERED;
         copy_text_field(admin->peer_service_name, body.peer_name);
     } else {
+        // A refused first service counts as answered too: the caller that waits for it finds the service not
+        // open.
         admin->state = admin->open_services ? GCL_ADMIN_GREETED : GCL_ADMIN_OPEN_ANSWERED;
     }
     return LC_OK;

@@ -76,6 +76,7 @@ bool has_changed(const blocking_wait *wait, const watched_state *before) {
 bool gcl_end_is_pending(const gcl *instance) {
     if (instance->options.ending && *instance->options.ending)
         return true;
+    // Includes the signals that are pending for the process as a whole.
     sigset_t pending;
     if (sigpending(&pending) != 0)
         return false;
@@ -104,6 +105,7 @@ void forget_deleted_timers(blocking_wait *wait, const fdic_event_array *events) 
         fdic_event key{};
         key.id = wait->timers[i].id;
         if (fdic_event_array_binary_search(events, &key, nullptr) != LC_OK)
+            // The last one fills the gap. The loop runs backwards and has seen it already.
             wait->timers[i] = wait->timers[--wait->timer_count];
     }
 }
@@ -118,6 +120,7 @@ lc_status track_timer(blocking_wait *wait, const fdic_event *event, int64_t now,
             static_cast<seen_timer *>(realloc(wait->timers, (size_t{at} + 1) * sizeof(seen_timer)));
         CHECK_NULL(larger);
         wait->timers = larger;
+        // A delay that no running timer has, so that the comparison below starts it.
         wait->timers[wait->timer_count++] = {event->id, -1, 0, false};
     }
     seen_timer *timer = &wait->timers[at];
@@ -146,6 +149,7 @@ lc_status run_due_timers(blocking_wait *wait, const fdic_event_array *events, in
             *out_next = *out_next < 0 || left < *out_next ? left : *out_next;
             continue;
         }
+        // Before the call: a timer fires once, until its delay is changed.
         timer->called = true;
         LC_LOG(LC_LOG_INFO, "GCL timeout forced");
         CHECK_STATUS(
@@ -211,6 +215,7 @@ lc_status wait_one_round(blocking_wait *wait, bool *out_stop) {
     int64_t next_timer = -1;
     CHECK_STATUS(run_due_timers(wait, events.pointer, &next_timer));
     const uint32_t count = fdic_event_array_length_quick(events.pointer);
+    // One more than needed, since calloc() may return null for 0 bytes.
     owned<pollfd, free_polled> polled(static_cast<pollfd *>(calloc(count + 1, sizeof(pollfd))));
     CHECK_NULL(polled.pointer);
     CHECK_QUIET(fill_polled(events.pointer, polled.pointer));
@@ -222,6 +227,7 @@ lc_status wait_one_round(blocking_wait *wait, bool *out_stop) {
     const bool sliced = left < 0 || slice < left;
     const int ready = poll(polled.pointer, count, static_cast<int>(sliced ? slice : left));
     if (ready == 0)
+        // The end of a slice isn't the caller's timeout.
         return sliced ? LC_OK : LC_IO_TIMED_OUT;
     if (ready < 0 && errno == EINTR)
         return LC_OK;
@@ -241,6 +247,8 @@ lc_status gcl_session_do_blocking_io(gcl *instance, gcl_session *session, int st
                                      int stop_on_protocol_state, uint16_t protocol, int64_t timeout_ms) {
     CHECK_NULL(instance);
     CHECK_NULL(session);
+    // The guard disables cancellation for the whole wait, which therefore has to check for itself whether the
+    // process is ending.
     const gcl_session_guard guard(session);
     blocking_wait wait = {};
     wait.instance = instance;
@@ -286,6 +294,7 @@ lc_status gcl_session_client_open_service_blocking(gcl_session *session, uint16_
     const gcl_session_guard guard(session);
     const gcl_admin *admin = gcl_admin_of(session);
     CHECK_NULL(admin);
+    // A session that has opened a service before is past its greeting.
     while (admin->state != GCL_ADMIN_GREETED && admin->state != GCL_ADMIN_OPEN_ANSWERED) {
         CHECK_QUIET(wait_for_peer(session, 0, GCL_PROTO_ADMIN, timeout_ms));
         if (admin->state != GCL_ADMIN_GREETING_AWAITED && admin->state != GCL_ADMIN_GREETED)

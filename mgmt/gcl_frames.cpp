@@ -139,6 +139,7 @@ lc_status gcl_session_send_frame_components(gcl_session *session, uint16_t proto
     CHECK_QUIET(check_sendable(session));
     CHECK_QUIET(check_room(session, uint64_t{GCL_HEADER_BYTES} + length, GCL_QUEUE_MAX_BYTES));
     gcl_owned_buffer buffer;
+    // Cannot overflow: check_room has limited the sum.
     CHECK_STATUS(tb_new_size(&buffer.pointer, GCL_HEADER_BYTES + length));
     const uint8_t header[GCL_HEADER_BYTES] = {};
     CHECK_STATUS(tb_append_buf(buffer.pointer, header, sizeof header));
@@ -158,6 +159,7 @@ lc_status gcl_session_send_frame_components_tb(gcl_session *session, uint16_t pr
     const gcl_session_guard guard(session);
     CHECK_QUIET(check_sendable(session));
     if (header_bytes != GCL_HEADER_BYTES) {
+        // The buffer has no room for a header; all of its bytes are taken as the body.
         LC_LOG(LC_LOG_ERR, "session %d: tried to send frame with tb put bad header", session->id);
         CHECK_STATUS(gcl_session_send_frame_components(
             session, proto, mtype, static_cast<uint32_t>(tb_length(buffer.pointer)), tb_buf(buffer.pointer)));
@@ -213,6 +215,7 @@ uint64_t slice_bytes(const gcl_session *session) {
 }
 
 lc_status wait_for_slice(gcl_session *session) {
+    // The timer of an earlier run of the queue hasn't fired yet.
     if (session->rate_timer >= 0)
         return LC_OK;
     CHECK_STATUS(fdic_event_add_timer(session->instance->interests, RATE_SLICE_MS, session,
@@ -286,6 +289,7 @@ namespace {
 
 lc_status check_header(const gcl_session *session, const gcl_frame_header *header, uint32_t received) {
     if (memcmp(header->ident, GCL_FRAME_IDENT, sizeof header->ident) != 0) {
+        // Logged as a number, since the bytes need not be printable.
         uint32_t ident;
         memcpy(&ident, header->ident, sizeof ident);
         LC_LOG(LC_LOG_ERR, "session %d: invalid frame ident: %x", session->id, ident);
@@ -317,6 +321,7 @@ const gcl_message_handler *find_handler(const gcl_body_protocol *protocol, uint1
 lc_status deliver_frame(gcl_session *session, tbuffer **inout_frame) {
     const auto length = static_cast<uint32_t>(tb_length(*inout_frame));
     gcl_byte_swap_frame_header(tb_buf(*inout_frame));
+    // Handlers get the header in host order, in the frame itself; the copy is for this function.
     gcl_frame_header header;
     memcpy(&header, tb_buf(*inout_frame), sizeof header);
     CHECK_QUIET(check_header(session, &header, length));
@@ -353,6 +358,7 @@ uint32_t bytes_unread(const gcl_session *session) {
 lc_status reset_buffer(gcl_session *session) {
     session->read_position = 0;
     if (tb_size(session->read_buffer) > GCL_READ_BUFFER_KEEP) {
+        // If there is no memory for a new one, the session is closed and never reads again.
         tb_free(&session->read_buffer);
         CHECK_STATUS(tb_new_size(&session->read_buffer, GCL_READ_BUFFER_BYTES));
         return LC_OK;
@@ -372,6 +378,7 @@ lc_status next_frame(gcl_session *session, tbuffer **out_frame) {
     gcl_wire_header header;
     memcpy(&header, tb_buf(session->read_buffer) + session->read_position, sizeof header);
     const uint32_t total = to_host(header.total_length);
+    // The only field that is checked before the frame is complete, since it decides how much is read.
     if (total < GCL_HEADER_BYTES || total > GCL_FRAME_MAX) {
         LC_LOG(LC_LOG_ERR, "session %d: invalid frame total length: %u not in %u to %u", session->id, total,
                GCL_HEADER_BYTES, GCL_FRAME_MAX);
@@ -461,6 +468,7 @@ lc_status timer_activity(gcl_session *session) {
     const int32_t timer = session->rate_timer;
     session->rate_timer = -1;
     if (timer >= 0)
+        // A timer that has fired stays in the interest list until it is deleted.
         CHECK_STATUS(fdic_event_delete_timer(session->instance->interests, timer));
     return gcl_run_output_queue(session);
 }
@@ -488,6 +496,7 @@ lc_status gcl_session_fd_read_write_timeout_activity(int, uint32_t kind, void *d
     }
     if (status == LC_OK)
         return LC_OK;
+    // The function that failed may have closed the session already.
     if (session->state != GCL_SESSION_CLOSED) {
         LC_LOG(LC_LOG_WARNING, "session %d: closing after error condition", session->id);
         LOG_STATUS(gcl_session_close(session, 0));

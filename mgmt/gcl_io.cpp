@@ -21,8 +21,10 @@ int64_t lf_read_bytes_closed(int fd, void *buffer, uint64_t count, int *out_clos
         }
         if (got < 0 && errno == EINTR)
             continue;
+        // Everything that has arrived so far has been read.
         if (got < 0 && (errno == EAGAIN || errno == EWOULDBLOCK))
             break;
+        // ECONNRESET: the peer has closed the connection without reading everything that was sent to it.
         if (got == 0 || errno == ECONNRESET || errno == EBADF) {
             *out_closed = 1;
             break;
@@ -54,6 +56,7 @@ lc_status lf_write_bytes(int fd, const void *bytes, int64_t count, uint64_t *out
 
 int lf_is_writable(int fd) {
     pollfd watched = {fd, POLLOUT, 0};
+    // Also true for an error or a hangup, which the write that follows then reports.
     return poll(&watched, 1, 0) > 0;
 }
 

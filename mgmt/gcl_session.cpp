@@ -32,6 +32,7 @@ constexpr int CONNECT_DELAY_MS = 1500;
 namespace {
 
 lc_status check_client_name(const char *name) {
+    // In the session's name a dash separates the client's name from the ids.
     if (name && strchr(name, '-')) {
         LC_LOG(LC_LOG_ERR, "Invalid character in client name: %s", name);
         return LC_GENERIC;
@@ -89,6 +90,7 @@ void make_endpoint(gcl_endpoint *endpoint, const char *role, const char *name) {
     address.sun_family = AF_UNIX;
     strlcpy(address.sun_path, path, sizeof address.sun_path);
     memcpy(&endpoint->address, &address, sizeof address);
+    // The family, the path and its NUL.
     endpoint->length = static_cast<socklen_t>(strlen(address.sun_path) + 3);
 }
 
@@ -98,6 +100,8 @@ lc_status copy_endpoint(gcl_endpoint *endpoint, const sockaddr *address, socklen
     memcpy(&endpoint->address, address, length);
     endpoint->length = length;
     if (endpoint->address.ss_family == AF_UNIX && length > offsetof(sockaddr_un, sun_path)) {
+        // The path of a sockaddr_un need not end with a NUL. An abstract name, which begins with one, gives
+        // an empty path and nothing to remove.
         const size_t room = length - offsetof(sockaddr_un, sun_path);
         const char *path =
             reinterpret_cast<const char *>(&endpoint->address) + offsetof(sockaddr_un, sun_path);
@@ -125,6 +129,7 @@ lc_status open_unix(gcl_session *session) {
     // user's socket.
     if (mkdir(GCL_SOCKET_DIRECTORY, 0700) == 0)
         (void)chmod(GCL_SOCKET_DIRECTORY, 01777);
+    // The file of an earlier process with the same id would make bind() fail.
     (void)unlink(path);
     if (bind(session->fd, reinterpret_cast<const sockaddr *>(&session->local.address),
              session->local.length) != 0) {
@@ -136,6 +141,7 @@ lc_status open_unix(gcl_session *session) {
 }
 
 lc_status open_inet(gcl_session *session) {
+    // A program that runs with the ids of another user is refused: over TCP the provider can't verify ids.
     if (geteuid() != 0 && (getuid() != geteuid() || getgid() != getegid())) {
         LC_LOG(LC_LOG_ERR, "Bad uid/gid for INET client connection");
         return LC_GENERIC;
@@ -207,6 +213,7 @@ void *interest_argument(uintptr_t kind) {
 lc_status set_up_session(gcl_session *session, const char *client_name, const sockaddr *address,
                          socklen_t length) {
     gcl *instance = session->instance;
+    // Created first, since gcl_session_free takes it.
     CHECK_CONDITION(lc_lock_init(&session->lock, 1) == 0);
     session->uid = static_cast<int32_t>(geteuid());
     session->gid = static_cast<int32_t>(getegid());
@@ -239,6 +246,7 @@ lc_status gcl_session_client_new(gcl *instance, const char *client_name, const s
     *out = nullptr;
     CHECK_NULL(instance);
     CHECK_QUIET(check_client_name(client_name));
+    // The new session has no lock yet; until it has one, the instance's lock is enough.
     const cancel_off_guard cancel_off;
     const lc_lock_guard guard(instance->lock);
     auto *session = static_cast<gcl_session *>(calloc(1, sizeof(gcl_session)));
@@ -271,6 +279,7 @@ namespace {
 // Closes a session that could not connect.
 void abandon_connection(gcl_session *session) {
     if (session->fd_interest >= 0)
+        // Before the descriptor is closed, since its number may be reused at once.
         LOG_STATUS(fdic_event_update_fd(session->instance->interests, session->fd_interest, 0, 0));
     close(session->fd);
     session->fd = -1;
@@ -288,7 +297,9 @@ lc_status try_connect(gcl_session *session, int attempts) {
                     session->peer.length) == 0 ||
             errno == EISCONN)
             return LC_OK;
+        // The line that is logged below must show this error, not one of a later call.
         const int failure = errno;
+        // There is no socket file, or nobody listens on it: the provider isn't running, or is just starting.
         const bool absent = failure == ECONNREFUSED || failure == ENOENT;
         const bool passing = absent || failure == EALREADY || failure == EINPROGRESS;
         if (passing && attempts > 0) {
@@ -323,6 +334,7 @@ lc_status gcl_session_client_connect_by_sockaddr(gcl_session *session, const soc
     CHECK_STATUS(copy_endpoint(&session->peer, address, length));
     const lc_status status = try_connect(session, retry ? CONNECT_ATTEMPTS : 1);
     if (status != LC_OK) {
+        // try_connect has logged the reason, unless the process is ending.
         abandon_connection(session);
         return status;
     }
@@ -383,6 +395,7 @@ lc_status gcl_session_close(gcl_session *session, int flush) {
     close(session->fd);
     session->fd = -1;
     session->state = GCL_SESSION_CLOSED;
+    // A provider's path belongs to its listening socket.
     if (session->family == AF_UNIX && !session->provider && session->local.path[0])
         (void)unlink(session->local.path);
     session->want_write = 0;
@@ -415,6 +428,7 @@ lc_status gcl_session_free(gcl_session **inout) {
         return LC_OK;
     }
     const gcl_session_guard guard(session);
+    // Out of the list first: a close handler that is called below must not find the session there.
     unlink_session(session);
     LOG_STATUS(gcl_run_hooks(session, GCL_HOOK_FREE));
     for (uint16_t protocol = 0; protocol < GCL_PROTOCOLS_MAX; protocol++)

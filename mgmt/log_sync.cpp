@@ -12,6 +12,7 @@
 
 namespace {
 
+// The path of the file is a single part of the name; therefore its slashes are escaped.
 #define MESSAGES_FILE NODE_SYSLOG "/action/file/\\/var\\/log\\/messages"
 constexpr const char *SYSTEM_LEVEL = MESSAGES_FILE "/facility/all/min_priority";
 constexpr const char *OVERRIDE_ENABLE = MESSAGES_FILE "/facility/override/enable";
@@ -28,6 +29,7 @@ node_name process_level_node() {
 int class_index() {
     int32_t facility = 0;
     (void)lc_log_get_syslog_facility(&facility);
+    // The low three bits are for the level. Local facilities begin at number 16.
     return ((facility >> 3) & 127) - 16;
 }
 node_name class_level_node() {
@@ -50,6 +52,7 @@ bool is_filled(const owned_tstring &text) {
 }
 
 lc_status enable_class_override(const char *level) {
+    // In this order: a level that isn't a level's name turns the switch off again.
     CHECK_STATUS(lc_log_enable_override_log_level(0, 1));
     CHECK_STATUS(lc_log_set_override_log_level(level));
     return LC_OK;
@@ -66,6 +69,7 @@ lc_status set_daemon_level(const char *name) {
 
 lc_status qv_init_log_level(mdc *session) {
     owned_tstring system, own, override_level;
+    // A system level that can't be read or parsed stays as it is, and the other nodes are still read.
     if (read_level_text(session, SYSTEM_LEVEL, &system) == LC_OK && is_filled(system) &&
         lc_log_set_max_log_level(ts_str(system.pointer)) == LC_OK)
         LC_LOG(LC_LOG_NOTICE, "Synchronized system log level to '%s'", ts_str(system.pointer));
@@ -123,6 +127,7 @@ lc_status change_process_level(const bn_binding *binding, bool *ended) {
         CHECK_QUIET(set_daemon_level(ts_str(value.pointer)));
         LC_LOG(LC_LOG_INFO, "Process log_level='%s'", ts_str(value.pointer));
     } else if (deleted || value.pointer) {
+        // The process has no level of its own any more. A binding without any value changes nothing.
         CHECK_STATUS(lc_log_set_daemon_log_level(-1));
     }
     return LC_OK;

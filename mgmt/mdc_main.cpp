@@ -114,6 +114,7 @@ lc_status mdc_get_binding_children_ex(mdc *handle, uint32_t *out_code, tstring *
     if (!response.pointer)
         return LC_OK;
     uint32_t revision = 0;
+    // Refuses a response of another type before anything is taken from it.
     CHECK_STATUS(bn_query_response_msg_get_db_revision_id(response.pointer, &revision));
     if (out_revision)
         *out_revision = revision;
@@ -127,6 +128,7 @@ namespace {
 lc_status append_triples(bn_request_msg *request, uint32_t count, va_list triples) {
     for (uint32_t i = 0; i < count; i++) {
         const char *name = va_arg(triples, const char *);
+        // A null name ends the list early.
         if (!name)
             break;
         const uint32_t type = va_arg(triples, uint32_t);
@@ -179,6 +181,7 @@ lc_status call_if_matching(const bn_binding_array *bindings, bn_binding *binding
         parts = split.pointer;
     }
     int matched = 0;
+    // Only the parts are compared: a relative pattern also matches absolute names.
     CHECK_STATUS(tstr_array_wildcard_match(pattern_parts, parts, &matched));
     if (!matched)
         return LC_OK;

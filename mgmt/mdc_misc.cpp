@@ -66,6 +66,7 @@ lc_status mdc_remote_reg_new_node(mdc_remote_reg **out, const char *name, uint32
 lc_status mdc_remote_reg_add_node(tree *registered, mdc_remote_reg **inout_record) {
     CHECK_NULL(inout_record);
     CHECK_NULL(*inout_record);
+    // A name that is registered twice has the later record; the tree frees the earlier one.
     CHECK_STATUS(tree_set_node_value_by_path_str(registered, nullptr, ts_str((*inout_record)->name),
                                                  *inout_record, 1, nullptr));
     *inout_record = nullptr;
@@ -132,6 +133,7 @@ uint64_t wire_bytes(const bn_binding *binding) {
 }
 
 lc_status report_node(const mon_walk *walk, const char *name, const tstr_array *parts) {
+    // The daemon may append any number of bindings; only those are counted.
     uint32_t at = bn_binding_array_length_quick(walk->found);
     CHECK_STATUS(walk->get(name, parts, walk->get_data, walk->found));
     for (; at < bn_binding_array_length_quick(walk->found); at++)
@@ -192,6 +194,7 @@ lc_status walk_children(const mon_walk *walk, tstr_array *parts, tree_node *node
 }
 
 lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts, uint32_t depth) {
+    // Depth 0 is the node that was asked for, 1 its children. Nothing below them is wanted without the flag.
     if ((depth >= 2 && !(walk->flags & bn_qf_subtree)) || walk->answer->too_large)
         return LC_OK;
     owned_tstring name;
@@ -199,6 +202,7 @@ lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts,
     tree_node *node = nullptr;
     const mdc_remote_reg *record = nullptr;
     CHECK_STATUS(mdc_remote_reg_get_node_tree(walk->registered, parts, &node, &record));
+    // Not registered: only this branch ends.
     if (!node)
         return LC_OK;
     if (!record)
@@ -206,6 +210,7 @@ lc_status mdc_mon_iterate_node_internal(const mon_walk *walk, tstr_array *parts,
         return walk_children(walk, parts, node, depth + 1);
     const char *text = ts_str(name.pointer);
     if (lc_is_suffix("/*", mdc_remote_reg_get_name(record), 0) && lc_is_suffix("/*", text, 0))
+        // The wildcard is not a level of its own: its children count as those of its parent.
         return walk_wildcard(walk, parts, depth == 0 ? 1 : depth);
     if (depth > 0 || (walk->flags & bn_qf_include_self)) {
         uint32_t children = 0;
@@ -318,6 +323,7 @@ lc_status mdc_dispatch_mon_request(gcl_session *session, bn_request_msg *request
     owned_response response;
     CHECK_STATUS(bn_query_response_msg_create(
         &response.pointer, static_cast<uint32_t>(bn_request_get_msg_id(request)), 0, nullptr));
+    // Holds the bindings of one node at a time, until they are moved to the response.
     owned_bindings found;
     CHECK_STATUS(bn_binding_array_new(&found.pointer));
     tree_options options;
@@ -327,6 +333,7 @@ lc_status mdc_dispatch_mon_request(gcl_session *session, bn_request_msg *request
     options.name_to_parts = bn_binding_name_to_parts;
     owned<tree, free_tree> registered;
     CHECK_STATUS(tree_new(&registered.pointer, &options));
+    // A pass of its own, since a registration may follow the node that needs it.
     uint32_t registered_parts = 0;
     for (uint32_t i = 0; i < count; i++)
         if (info.pointer[i].subop == bn_query_registration_info)
@@ -385,6 +392,7 @@ lc_status change_delete(const change_entry *entry) {
     if (!entry->new_values)
         return LC_OK;
     uint32_t type = 0;
+    // In the new values a deletion is a binding of the old type with the marks and without a value.
     CHECK_STATUS(bn_binding_get_type(entry->old_value, bn_attrib_value, &type, nullptr));
     owned_binding gone;
     CHECK_STATUS(bn_binding_new_str(&gone.pointer, entry->name, bn_attrib_value, type & 0xffff,
@@ -414,6 +422,7 @@ lc_status add_change(bn_binding_array *bindings, const char *entry_name, bn_bind
         bn_binding_array_get_value_tstr_by_name_rel(bindings, entry_name, "name", nullptr, &name.pointer));
     CHECK_NULL(type.pointer);
     CHECK_NULL(name.pointer);
+    // Either may be absent; which of them a change needs depends on its type.
     const bn_binding *new_value = nullptr, *old_value = nullptr;
     CHECK_STATUS(
         bn_binding_array_get_binding_by_name_rel(bindings, entry_name, "new_attribs/value", &new_value));
@@ -443,6 +452,7 @@ lc_status mdc_event_config_change_notif_extract(bn_binding_array *bindings, bn_b
         CHECK_STATUS(bn_binding_array_new(&old_values.pointer));
     if (out_new)
         CHECK_STATUS(bn_binding_array_new(&new_values.pointer));
+    // Sorted, so that the same names are neighbours and the searches below are by bisection.
     CHECK_STATUS(bn_binding_array_sort(bindings));
     const uint32_t count = bn_binding_array_length_quick(bindings);
     const char *before = nullptr;

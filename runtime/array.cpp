@@ -22,6 +22,7 @@
 
 int array_std_compare_func(const void *a, const void *b) {
     const auto left = *static_cast<const uintptr_t *>(a), right = *static_cast<const uintptr_t *>(b);
+    // The difference of two user-space addresses fits in a signed word.
     const auto difference = static_cast<intptr_t>(left - right);
     return (difference > 0) - (difference < 0);
 }
@@ -146,6 +147,7 @@ lc_status array_empty(array *list) {
     while (list->length)
         free_element(list, list->elements[--list->length]);
     list->sorted = 1;
+    // Slots in a caller's memory never get here: they have the initial capacity, and growing replaces them.
     if (list->capacity != list->initial_size) {
         auto *smaller = static_cast<void **>(realloc(list->elements, list->initial_size * sizeof(void *)));
         if (smaller) {
@@ -160,11 +162,13 @@ namespace {
 
 lc_status reserve_slots(array *list, uint64_t length) {
     CHECK_CONDITION(length <= array_size_max);
+    // Grows by ten slots or doubles, whichever is more; the limit above ends the loop.
     uint64_t capacity = list->capacity;
     while (capacity < length)
         capacity = std::min<uint64_t>(std::max(capacity + 10, capacity * 2), array_size_max);
     if (capacity == list->capacity)
         return LC_OK;
+    // Slots in a caller's memory can't be reallocated. They are copied to new ones and left alone.
     auto *elements = static_cast<void **>(
         realloc(list->placed_elements ? nullptr : list->elements, capacity * sizeof(void *)));
     CHECK_NULL(elements);
@@ -270,6 +274,7 @@ lc_status array_insert_takeover(array *list, uint32_t index, void **inout_elemen
     CHECK_STATUS(reserve_slots(list, uint64_t{list->length} + 1));
     if (index < list->length)
         array_index_drop(list);
+    // Into a variable first: if the takeover fails, no element has been moved yet.
     void *slot = nullptr;
     CHECK_STATUS(list->takeover(inout_element, &slot));
     memmove(list->elements + index + 1, list->elements + index, (list->length - index) * sizeof(void *));
@@ -302,6 +307,7 @@ lc_status array_append_no_dup_takeover(array *list, void **inout_element) {
     CHECK_NULL(list);
     CHECK_NULL(inout_element);
     uint32_t index = 0;
+    // Before the old element may be deleted, so that the new one cannot fail for lack of memory after that.
     CHECK_STATUS(reserve_slots(list, uint64_t{list->length} + 1));
     if (list->duplicate_policy != array_dup_allow &&
         array_linear_search(list, *inout_element, 0, &index) == LC_OK) {
@@ -379,6 +385,7 @@ lc_status array_remove(array *list, uint32_t index, void **out_element) {
     CHECK_NULL(out_element);
     CHECK_QUIET(array_get(list, index, out_element));
     array_index_drop(list);
+    // Removing an element leaves the others in order; `sorted` is unchanged.
     list->length--;
     memmove(list->elements + index, list->elements + index + 1, (list->length - index) * sizeof(void *));
     return LC_OK;
@@ -499,6 +506,7 @@ lc_status array_concat(array *list, array *moved) {
         list->elements[list->length++] = moved->elements[i];
         update_sorted(list, list->length - 1);
     }
+    // Its elements belong to the other array now; array_empty only gives memory back.
     moved->length = 0;
     return array_empty(moved);
 }
@@ -542,6 +550,7 @@ lc_status visit_elements(array *list, array_foreach_function function, void *dat
             return LC_OK;
         default:
             LC_LOG(LC_LOG_WARNING, "Got return code %d from foreach function", status);
+            // The walk continues: one element that fails doesn't keep the others from being visited.
             result = LC_GENERIC;
         }
         i++;

@@ -43,6 +43,7 @@ uint32_t *find_index_slot(const array *list, const void *key) {
 }
 
 bool make_index(const array *list) {
+    // At most a third full at first. It is made anew when appended elements have filled half of it.
     uint32_t count = 64;
     while (count < 3 * uint64_t{list->length} && count < 0x40000000)
         count *= 2;
@@ -68,6 +69,7 @@ bool update_index(const array *list) {
         return false;
     while (list->index->indexed < list->length) {
         const uint32_t position = list->index->indexed++;
+        // A null element can't be hashed, and no key equals it.
         if (!list->elements[position])
             continue;
         uint32_t *slot = find_index_slot(list, list->elements[position]);

@@ -143,6 +143,7 @@ char *next_word(char **inout_text) {
 uint64_t parse_hex(const char *word, uint64_t limit) {
     char *end = nullptr;
     errno = 0;
+    // strtoull would accept a minus sign and wrap the number around.
     const unsigned long long number = strtoull(word, &end, 16);
     return errno == 0 && *end == '\0' && word[0] != '-' && number <= limit ? number : 0;
 }
@@ -152,6 +153,7 @@ bool parse_conf_line(char *line, cmem_conf *out, const char **out_wrong) {
     *out_wrong = nullptr;
     const char *name = next_word(&line);
     if (name[0] == '#' || name[0] == '\0')
+        // The name is cut to what a record can hold; block names are compared by as many characters.
         return false;
     *out = {};
     memcpy(out->name, name, strnlen(name, NAME_BYTES - 1));
@@ -180,6 +182,7 @@ int read_conf(const char *path, const Take &take, const Fail &fail) {
     for (uint32_t number = 0; file && more && fgets(line, sizeof line, file);) {
         const bool rest = inside;
         char *end = strpbrk(line, "\r\n");
+        // A last line without a newline is shorter than the buffer, and therefore complete.
         inside = !end && strlen(line) == sizeof line - 1;
         if (end)
             *end = '\0';
@@ -214,6 +217,7 @@ bool load_conf(cmem_registry *fresh) {
         });
     if (error) {
         QV_LOG(LC_LOG_ERR, "%s: cannot read %s, err=%s\n", "cmem_load_conf", CMEM_CONF_PATH, strerror(error));
+        // Entries from before the error are dropped; the next process reads the file from its start.
         memset(static_cast<void *>(fresh->conf), 0, sizeof fresh->conf);
     }
     return error == 0;
@@ -261,12 +265,15 @@ uint64_t segment_bytes(int id) {
 bool fill_registry(cmem_registry *fresh) {
     for (unsigned waited = 0;; waited++) {
         uint32_t state = REGISTRY_EMPTY;
+        // The kernel fills a new segment with zeros, which is the state "empty"; one process wins the
+        // exchange.
         if (fresh->state.compare_exchange_strong(state, REGISTRY_LOADING)) {
             fresh->state = load_conf(fresh) ? REGISTRY_READY : REGISTRY_EMPTY;
             return true;
         }
         if (state == REGISTRY_READY)
             return true;
+        // Not a state of ours: the segment belongs to something else that uses the same key.
         if (state != REGISTRY_LOADING) {
             errno = EINVAL;
             attach_failed();
@@ -294,6 +301,7 @@ cmem_registry *attach_registry() {
     if (memory == reinterpret_cast<void *>(-1))
         attach_failed();
     cmem_registry *attached = static_cast<cmem_registry *>(memory);
+    // `registry` stays null while another process is stuck in loading; the next call waits again.
     if (fill_registry(attached))
         registry = attached;
     else
@@ -312,6 +320,7 @@ namespace {
 
 cmem_block *find_block(cmem_registry *known, const char *name) {
     for (cmem_block &block : known->blocks)
+        // A claimed record whose name isn't written yet has an empty one, which no caller may ask for.
         if (block.in_use && strncmp(block.name, name, NAME_BYTES - 1) == 0)
             return &block;
     return nullptr;
@@ -327,6 +336,7 @@ cmem_block *claim_block(cmem_registry *known) {
 }
 
 void free_block(cmem_block *block) {
+    // In this order: once the record is free, another process may claim it and write its own name.
     memset(block->name, 0, sizeof block->name);
     block->in_use = 0;
 }
@@ -388,7 +398,8 @@ void fill_block_record(cmem_block *block, const cmem_registry *known, const char
     block->diagnostic = 0;
     strlcpy(block->owner, program_invocation_short_name, sizeof block->owner);
     // The name is written last, and its first byte after the others: a process that finds the name, without
-    // any lock, finds the record complete.
+    // any lock, finds the record complete. A record that is taken over has its name already, but also the
+    // same size and key as before.
     strlcpy(block->name + 1, name + 1, sizeof block->name - 1);
     __atomic_store_n(&block->name[0], name[0], __ATOMIC_RELEASE);
 }
@@ -403,12 +414,16 @@ cmem_block *take_block(cmem_registry *known, const char *name, uint64_t length) 
             QV_LOG(LC_LOG_ERR, "%s: out of memory tracking blocks\n", "cmem_create_block");
         return block;
     }
+    // A second creator would zero the data that the first one is using.
     if (creator_lives(known, block)) {
         QV_LOG(LC_LOG_ERR, "%s: double create attempt for memory block %s, old pid=%d, new pid=%d\n",
                "cmem_create_block", name, block->pid.load(), getpid());
         return nullptr;
     }
+    // Other programs write to the registry too, and a page size of 0 would divide by zero.
     const uint64_t rounded = round_up(length, block->page_size ? block->page_size : NORMAL_PAGE);
+    // The new size can't be had by taking the record over: the old segment keeps its size, and others may
+    // still have it attached.
     if (rounded != block->length) {
         QV_LOG(LC_LOG_NOTICE, "%s: length change attempt for memory block %s, old len=%lu, new len=%lu\n",
                "cmem_create_block", name, static_cast<unsigned long>(block->length),
@@ -426,12 +441,14 @@ struct creation_lock {
         // Both steps are one atomic operation: wait for 0, and add 1.
         const timespec limit = {WAIT_SECONDS, 0};
         int result;
+        // If semget failed, the id is -1 and this fails with EINVAL. After the time limit it is EAGAIN.
         do
             result = semtimedop(id, take, 2, &limit);
         while (result != 0 && errno == EINTR);
         held = result == 0;
     }
     ~creation_lock() {
+        // SEM_UNDO here as well: it cancels the adjustment that the kernel has kept since the lock was taken.
         sembuf release = {.sem_num = 0, .sem_op = -1, .sem_flg = SEM_UNDO | IPC_NOWAIT};
         if (held)
             semop(id, &release, 1);
@@ -459,6 +476,7 @@ cmem_block *claim_name(cmem_registry *known, const char *name, uint64_t length) 
 }
 
 void place_on_node(void *memory, const cmem_block *block) {
+    // Without NUMA, or without that node, the kernel's own placement is good enough.
     if (numa_available() < 0)
         return;
     if (block->node > numa_max_node())
@@ -498,6 +516,8 @@ void *cmem_create_block(uint64_t length, const char *name) {
         return nullptr;
     }
     const int key = static_cast<int>(block->key);
+    // With size 0 an existing segment is found whatever its size. Segments are never removed: other programs
+    // may have this one attached, and a restarted creator uses it again.
     int id = shmget(key, 0, 0);
     const bool fresh = id < 0;
     if (fresh)
@@ -525,6 +545,7 @@ void *cmem_create_block(uint64_t length, const char *name) {
         return nullptr;
     }
     block->creator_address = reinterpret_cast<uint64_t>(memory);
+    // Before the block is zeroed: the policy applies to pages that haven't been touched yet.
     if (fresh)
         place_on_node(memory, block);
     // A new segment is zero already; one that outlived its creator isn't.
@@ -544,6 +565,7 @@ int cmem_exists_block(const char *name) {
     const cmem_block *block = find_block(known, name);
     if (!block)
         return 0;
+    // The record outlives the segment if somebody removes that by hand.
     if (shmget(static_cast<int>(block->key), 0, 0) < 0) {
         QV_LOG(LC_LOG_ERR, "%s: cannot shmget to shared block %s, err=%s\n", __func__, name, strerror(errno));
         return 0;
@@ -587,6 +609,7 @@ void *cmem_attach_block(const char *name, uint64_t *out_length) {
                name, strerror(errno), static_cast<unsigned>(id), address, 0U);
         return nullptr;
     }
+    // The real size, which is what the caller may touch; the record is only what somebody wrote.
     if (out_length)
         *out_length = held;
     return memory;

@@ -185,6 +185,7 @@ lc_status lc_str_to_bool(const char *string, int32_t *out_value) {
 int lc_is_prefix(const char *prefix, const char *string, int ignore_case) {
     if (!prefix || !string)
         return 0;
+    // A string shorter than the prefix differs at its NUL.
     const size_t length = strlen(prefix);
     return (ignore_case ? strncasecmp(prefix, string, length) : strncmp(prefix, string, length)) == 0;
 }
@@ -230,6 +231,7 @@ extern "C" size_t strlcpy(char *dst, const char *src, size_t size) noexcept {
 }
 
 extern "C" size_t strlcat(char *dst, const char *src, size_t size) noexcept {
+    // If the buffer has no NUL at all, nothing is appended, and the result counts as truncated.
     const size_t held = strnlen(dst, size);
     return held + strlcpy(dst + held, src, size - held);
 }
@@ -265,6 +267,7 @@ lc_status format_new(char **out_string, uint32_t *out_length, const char *format
     // Only now, since FAIL_WITH returns: va_end has to come first.
     if (!enlarged)
         FAIL_WITH(LC_NULL);
+    // The second length differs if an argument was changed meanwhile by another thread.
     CHECK_CONDITION(first >= 0 && length == first);
     if (out_length)
         *out_length = static_cast<uint32_t>(length);
@@ -355,6 +358,7 @@ lc_status lc_setenv(const char *name, const char *value, int overwrite) {
         LC_LOG(LC_LOG_ERR, "Environment variable name \"%s\" contains illegal character '='", name);
         return LC_GENERIC;
     }
+    // The function releases the lock before it returns; only then may a failure be logged.
     CHECK_CONDITION(setenv_with_lock(name, value, overwrite) == 0);
     return LC_OK;
 }
@@ -389,6 +393,7 @@ int64_t own_thread_id() {
 // level.
 void release_at_thread_end(void *held) {
     lc_lock *lock = static_cast<lc_lock *>(held);
+    // The mutex of a recursive lock has to be released as often as it was acquired.
     while (lock->locked && lock->owner == own_thread_id() && lc_lock_unlock(lock) == 0) {
     }
 }
@@ -409,6 +414,7 @@ int lc_lock_init(lc_lock **out_lock, int recursive) {
     int result = pthread_mutex_init(&lock->mutex, &attributes);
     pthread_mutexattr_destroy(&attributes);
     if (result == 0) {
+        // A process has 1024 keys at most (PTHREAD_KEYS_MAX), which also limits the number of locks.
         result = pthread_key_create(&lock->key, release_at_thread_end);
         if (result != 0)
             pthread_mutex_destroy(&lock->mutex);
@@ -438,6 +444,7 @@ int lc_lock_lock(lc_lock *lock) {
 }
 
 int lc_lock_unlock(lc_lock *lock) {
+    // Tested without holding the mutex: only the thread itself can have stored its own id as the owner.
     if (!lock || !lock->locked || lock->owner != own_thread_id())
         return 1;
     // The fields are changed while the mutex is still held: after the unlock they belong to the next owner.
@@ -466,6 +473,8 @@ int lc_lock_deinit(lc_lock **inout_lock) {
 }
 
 int lc_lock_atfork(void (*prepare)(), void (*parent_and_child)()) {
+    // In the child, pthread_self() has the value of the thread that called fork(). The child is therefore the
+    // owner of the locks taken before, and can release them.
     return pthread_atfork(prepare, parent_and_child, parent_and_child);
 }
 

@@ -75,6 +75,7 @@ lc_status fdic_libevent_deinit(fdic_libevent **inout) {
     *inout = nullptr;
     if (!bridge)
         return LC_OK;
+    // First, since posted changes refer to the bridge.
     loop_withdraw_posted(bridge->loop, bridge);
     LOG_STATUS(ht_free(&bridge->entries));
     free(bridge);
@@ -230,6 +231,7 @@ lc_status apply_changes(fdic_libevent *bridge, const fdic_event_array *changes) 
 
 void apply_posted_changes(loop_post *post, int carry) {
     auto *posted = reinterpret_cast<posted_changes *>(post);
+    // Otherwise the work has been withdrawn, and only its memory is released.
     if (carry)
         (void)apply_changes(posted->bridge, posted->changes);
     (void)fdic_event_array_free(&posted->changes);
@@ -239,10 +241,12 @@ void apply_posted_changes(loop_post *post, int carry) {
 lc_status post_changes(fdic_libevent *bridge, const fdic_event_array *changes) {
     auto *posted = static_cast<posted_changes *>(calloc(1, sizeof(posted_changes)));
     CHECK_NULL(posted);
+    // The caller frees its array as soon as this returns.
     const lc_status status = fdic_event_array_duplicate(changes, &posted->changes);
     if (status != LC_OK)
         free(posted);
     CHECK_STATUS(status);
+    // By the poster, fdic_libevent_deinit withdraws what hasn't been applied yet.
     posted->post.poster = bridge;
     posted->post.function = apply_posted_changes;
     posted->bridge = bridge;

@@ -80,12 +80,14 @@ bool is_reported(const fdic_event *event, const fdic_event *reported) {
     if (event->has_fd && (event->fd != reported->fd || event->want_read != reported->want_read ||
                           event->want_write != reported->want_write))
         return false;
+    // The functions and their arguments never change after an interest has been added.
     return !event->has_timer || event->delay == reported->delay;
 }
 
 lc_status update_reported(fdic *context, const fdic_event *event) {
     uint32_t index = 0;
     if (event->active) {
+        // Replaces the older record with this id; that is the array's policy for duplicates.
         CHECK_STATUS(fdic_event_array_insert_sorted(context->reported, event));
     } else if (find_interest(context->reported, event->id, &index)) {
         CHECK_STATUS(fdic_event_array_delete(context->reported, index));
@@ -135,6 +137,7 @@ lc_status add_interest(fdic *context, fdic_event *event, int32_t *out_id) {
     event->context = context;
     event->id = context->next_id++;
     CHECK_STATUS(fdic_event_array_insert_sorted(context->current, event));
+    // Set before the callback runs, which may already use or delete the interest.
     *out_id = static_cast<int32_t>(event->id);
     CHECK_STATUS(report_changes(context));
     return LC_OK;
@@ -149,6 +152,7 @@ lc_status fdic_event_add_fd(fdic *context, int32_t fd, int32_t want_read, int32_
     *out_id = -1;
     CHECK_NULL(context);
     fdic_event event{};
+    // An interest in no descriptor is dropped when the changes are collected, and never reported.
     event.active = fd >= 0;
     event.has_fd = 1;
     event.fd = fd;

@@ -126,6 +126,7 @@ void set_bucket_count(ht *table, uint32_t bucket_count) {
     for (uint32_t i = 0; i < table->bucket_count; i++) {
         while (ht_entry *entry = table->buckets[i]) {
             table->buckets[i] = entry->next;
+            // The order of a chain doesn't matter: no two of its entries have the same key.
             ht_entry **head = &buckets[table->hash_function(entry->key, entry->key_length) % bucket_count];
             entry->next = *head;
             *head = entry;
@@ -170,6 +171,7 @@ lc_status delete_all_entries(ht *table) {
     lc_status result = LC_OK;
     for (uint32_t i = 0; i < table->bucket_count; i++) {
         while (table->buckets[i]) {
+            // A free function that fails doesn't keep the other entries from being freed.
             const lc_status status = delete_entry(table, &table->buckets[i]);
             if (status != LC_OK)
                 result = status;
@@ -231,6 +233,8 @@ lc_status ht_insert(ht *table, const void *key, int32_t key_length, void *value)
     // Deletes an old entry of this key. This may resize the table; therefore the place is looked up only
     // afterwards.
     CHECK_STATUS(ht_delete(table, key, key_length));
+    // Such a table stores copies of key and value; any other keeps the caller's pointers and owns them from
+    // now on.
     if (table->insert_function)
         CHECK_STATUS(table->insert_function(key, length, value, table->user_word, &entry.pointer->key,
                                             &entry.pointer->value));

@@ -64,6 +64,7 @@ lc_status create_state_lock() {
         return LC_OK;
     if (lc_lock_init(&G_log_state_lock, 0) != 0)
         return LC_GENERIC;
+    // Otherwise a child forked while another thread logs would inherit a lock that nobody ever releases.
     (void)lc_lock_atfork(lc_log_lock, lc_log_unlock);
     return LC_OK;
 }
@@ -91,6 +92,7 @@ lc_status init_with_lock(const char *process_name, const char *prefix, uint32_t 
     state->max_level = static_cast<uint8_t>(max_level);
     state->destinations = destinations;
     state->facility = facility;
+    // Overrides of an earlier call end here; lc_log_save_levels is for a caller that wants to keep them.
     state->override_level = 0;
     state->system_override = state->class_override = 0;
     strlcpy(state->prefix, prefix ? prefix : "", sizeof state->prefix);
@@ -114,6 +116,7 @@ lc_status init_with_lock(const char *process_name, const char *prefix, uint32_t 
         strlcpy(ident, state->process_name, sizeof ident);
         openlog(ident, options & ~LOG_NDELAY, facility);
     }
+    // A name that is too long may come without a NUL; the record's last byte is never written and stays 0.
     gethostname(state->host_name, sizeof state->host_name - 1);
     state->host_name[strcspn(state->host_name, ".")] = '\0';
     if (default_flags & LC_LOG_FLAG_RELATIVE) {
@@ -179,6 +182,7 @@ lc_status init_unnamed() {
     const char *slash = strrchr(name, '/');
     char full[96];
     snprintf(full, sizeof full, "%s-UNINIT", name[0] ? (slash ? slash + 1 : name) : "UNKNOWN");
+    // 0xb0000 is component 11, "unk", shifted left by 16.
     return lc_log_init(full, "unk", 0, 0xb0000, LC_LOG_DEBUG, LOG_USER, LOG_TO_SYSLOG);
 }
 
@@ -204,6 +208,7 @@ void append_text(line_format *format, const char *pattern, ...) __attribute__((f
 // Removes an incomplete conversion from the end of a format that was cut.
 void drop_half_conversion(line_format *format) {
     const char *const end = format->text + format->used;
+    // "%%" needs no case of its own: its second character is taken for the conversion character.
     for (const char *at = format->text; at < end;) {
         if (*at++ != '%')
             continue;
@@ -227,6 +232,7 @@ void append_text(line_format *format, const char *pattern, ...) {
     const int length =
         vsnprintf(format->text + format->used, sizeof format->text - format->used, pattern, arguments);
     va_end(arguments);
+    // vsnprintf returns the length that the text would have had without the limit.
     if (length > 0)
         format->used += static_cast<size_t>(length);
     if (format->used > FORMAT_CHARACTERS) {
@@ -266,6 +272,7 @@ void append_stamp(line_format *format, const log_line *line) {
 void append_thread_id(line_format *format, const log_line *line) {
     if (!lc_is_multithreaded || (line->flags & LC_LOG_FLAG_NO_THREAD))
         return;
+    // The kernel's thread id, which ps and gdb show, rather than pthread_self().
     append_text(format, "TID %lu: ", static_cast<unsigned long>(syscall(SYS_gettid)));
 }
 
@@ -282,6 +289,7 @@ void build_body(line_format *body, const log_line *line, const char *format) {
                 lc_enum_to_string_quiet(lc_log_level_upper_table, line->level));
     if (line->state->prefix[0])
         append_text(body, "%s: ", line->state->prefix);
+    // The caller's format is copied with its conversions, which write_line fills.
     if (line->flags & LC_LOG_FLAG_POSITION)
         append_text(body, "%s(), %s:%d, build %s: %s\n", line->function ? line->function : "",
                     line->file ? line->file : "", line->line, WCCP_BUILD, format);
@@ -296,6 +304,7 @@ void build_header(line_format *full, const log_line *line) {
     char text[32] = "";
     const time_t seconds = line->stamp.tv_sec;
     ctime_r(&seconds, text);
+    // ctime_r writes "Thu Jan  2 03:04:05 2020"; the weekday and the year are left out.
     append_text(full, "%.15s %s ", strlen(text) > 4 ? text + 4 : text, state->host_name);
     if (line->flags & LC_LOG_FLAG_NO_PID)
         append_text(full, "%s: ", state->process_name);
@@ -307,6 +316,7 @@ void set_stamp(log_line *line, const timeval *now) {
     lc_log_state *state = line->state;
     const bool relative = (line->flags & LC_LOG_FLAG_RELATIVE) != 0;
     line->stamp = *now;
+    // Whenever the flag changes from one line to the next, the stamps start again from 0.
     if (relative != state->relative) {
         state->relative = relative;
         state->relative_base = *now;
@@ -331,6 +341,7 @@ void write_line(const log_line *line, const line_format *full, const line_format
         FILE **stream;
     } consoles[] = {{LOG_TO_STDOUT, &stdout}, {LOG_TO_STDERR, &stderr}};
     const int saved = errno; // for a "%m" in the format
+    // Only the body: the head with time, program and process id is added by the socket's own format.
     if (line->state->destinations & LOG_TO_SYSLOG) {
         va_list copy;
         va_copy(copy, arguments);
@@ -353,6 +364,7 @@ void write_line(const log_line *line, const line_format *full, const line_format
 
 lc_status log_with_lock(log_line *line, int saved_errno, const char *format, va_list arguments) {
     lc_log_state *state = G_log_state;
+    // The log has been closed, or there was no memory for its state.
     if (!state)
         return LC_GENERIC;
     line->state = state;
@@ -398,6 +410,7 @@ lc_status lc_log_internal(const char *function, const char *file, int line, uint
     const cancel_off_guard uncancelled;
     if (inside_the_log)
         return LC_OK;
+    // A first line before lc_log_init; there is only the main thread by then.
     if (!G_log_state_lock)
         (void)init_unnamed();
     if (!G_log_state_lock)
@@ -429,6 +442,7 @@ lc_status qv_log_internal(int32_t level, const char *function, const char *prefi
     va_start(arguments, format);
     vsnprintf(text + used, sizeof text - used, format, arguments);
     va_end(arguments);
+    // As an argument of "%s", so that a "%" in the text isn't taken for a conversion.
     return lc_log_internal(nullptr, nullptr, 0, 0, 0, level, "%s", text);
 }
 

@@ -67,6 +67,7 @@ bool read_level_link(int32_t *out_level) {
     const ssize_t length = readlink(LEVEL_LINK, target, sizeof target - 1);
     if (length <= 0)
         return false;
+    // readlink() adds no NUL.
     target[length] = '\0';
     char *end = nullptr;
     const long level = strtol(target, &end, 10);
@@ -99,6 +100,7 @@ bool same_time(const timespec &a, const timespec &b) {
 } // namespace
 
 timespec log_level_link_time() {
+    // The link itself: it points to a number, not to a file.
     return modification_time(LEVEL_LINK, lstat);
 }
 timespec log_time_zone_time() {
@@ -128,6 +130,8 @@ void log_poll_level_link(lc_log_state *state, time_t now) {
         return;
     state->level_link_looked = now;
     const timespec changed = log_level_link_time();
+    // A link that has been removed leaves the level as it is. Its time is forgotten below, so that a new link
+    // is read even if it has the time of the old one.
     if (changed.tv_sec != 0 && !same_time(changed, state->level_link_changed)) {
         log_take_system_level(state);
         set_current_level(state, is_overridden(state) ? state->override_level
@@ -187,6 +191,7 @@ lc_status lc_log_get_max_log_level(int32_t *out_level) {
 
 lc_status lc_log_set_daemon_log_level(int32_t level) {
     CHECK_CONDITION(level >= -1 && level <= LC_LOG_DEBUG);
+    // Without the lock: both are atomic, and lines that are being written now may still use the old level.
     G_daemon_log_level = static_cast<int8_t>(level);
     syslog_set_mask(level == -1 ? G_log_level.load() : level);
     return LC_OK;
@@ -200,6 +205,7 @@ namespace {
 
 // Makes the override level current, or the system level.
 void apply_override(lc_log_state *state, bool overrides) {
+    // On a console only this record changes; the level in use stays.
     state->current_level = overrides ? state->override_level : static_cast<uint8_t>(state->system_level);
     if (!has_console(state))
         set_current_level(state, state->current_level);
@@ -232,6 +238,8 @@ lc_status set_override_level_with_lock(int32_t level) {
     const locked_state log;
     if (!log.state)
         return LC_NULL;
+    // Read before the switch is turned off: the end of an override that was in effect restores the system
+    // level.
     const bool counted = is_overridden(log.state);
     log.state->override_level = static_cast<uint8_t>(level == -1 ? log.state->system_level : level);
     if (level == -1)
@@ -321,6 +329,7 @@ void facility_from_file(const char *process_name, int32_t *facility) {
             *facility = static_cast<int32_t>(number);
             break;
         }
+        // Such words are for other classes of processes. The log isn't set up yet, therefore the plain file.
         (void)lc_log_file(nullptr, "Skipping facility type: %s for %s", word, process_name);
     }
     fclose(file);

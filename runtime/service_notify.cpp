@@ -32,6 +32,8 @@ void read_socket(const char *path) {
     memcpy(manager.sun_path, path, length);
     if (path[0] == '@')
         manager.sun_path[0] = '\0';
+    // The name of an abstract socket is all bytes of the given length. A NUL at its end would be part of it,
+    // and is not counted.
     manager_length = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + length);
 }
 
@@ -51,6 +53,7 @@ void service_open() {
         read_socket(path);
     if (const char *limit = getenv("WATCHDOG_USEC"))
         read_watchdog(limit, getenv("WATCHDOG_PID"));
+    // A child process must not inherit them, or it would report on our behalf.
     for (const char *name : {"NOTIFY_SOCKET", "WATCHDOG_USEC", "WATCHDOG_PID"})
         unsetenv(name);
 }
@@ -59,6 +62,7 @@ void service_report(const char *state) {
     if (manager_length == 0)
         return;
     const cancel_off_guard uncancelled;
+    // Non-blocking and without a retry: a service manager that doesn't read must not hold up the daemon.
     const int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
     if (fd < 0)
         return;

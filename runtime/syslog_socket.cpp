@@ -90,12 +90,14 @@ int connect_as(syslog_socket *log, int type) {
 // 0, or an errno. Most daemons have a datagram socket, some a stream.
 int connect_to_daemon(syslog_socket *log) {
     const int result = connect_as(log, SOCK_DGRAM);
+    // EPROTOTYPE: the socket at the path has another type.
     return result == EPROTOTYPE ? connect_as(log, SOCK_STREAM) : result;
 }
 
 // Whether the path now leads to another socket than the one that we are connected to.
 bool path_has_changed(const syslog_socket *log) {
     struct stat file = {};
+    // Without a path the connection is kept: a daemon that is being replaced may still read it.
     return stat(LOG_PATH, &file) == 0 && (file.st_dev != log->device || file.st_ino != log->inode);
 }
 
@@ -104,6 +106,7 @@ bool path_has_changed(const syslog_socket *log) {
 void syslog_socket_open(syslog_socket *log, const char *ident, bool with_pid, int32_t facility) {
     strlcpy(log->ident, ident, sizeof log->ident);
     log->with_pid = with_pid;
+    // Other bits would change the level of the lines.
     log->facility = facility & ~LOG_FACMASK ? LOG_USER : facility;
     log->fd = -1;
     log->patience_ns = SYSLOG_PATIENCE_NS;
@@ -120,6 +123,7 @@ bool wait_for_room(syslog_socket *log) {
     const timespec step = {0, WAIT_STEP_NS};
     pollfd writable = {log->fd, POLLOUT, 0};
     const int64_t began = lt_monotonic_ns();
+    // Without a connection this is only a pause.
     (void)ppoll(&writable, log->fd >= 0, &step, nullptr);
     const int64_t waited = lt_monotonic_ns() - began;
     log->patience_ns -= std::clamp<int64_t>(waited, LEAST_STEP_NS, WAIT_STEP_NS);
@@ -128,6 +132,7 @@ bool wait_for_room(syslog_socket *log) {
 
 // Sends a line on the present connection. 0, or an errno.
 int send_all_bytes(syslog_socket *log, const char *line, size_t length) {
+    // A datagram is sent whole or not at all; only a stream takes a part of a line.
     size_t sent = 0;
     while (sent < length) {
         const ssize_t went = send(log->fd, line + sent, length - sent, MSG_DONTWAIT | MSG_NOSIGNAL);
@@ -162,6 +167,7 @@ int send_line(syslog_socket *log, const char *line, size_t length) {
             log->patience_ns = SYSLOG_PATIENCE_NS;
             return 0;
         }
+        // A full queue is worth a new connection only if it belongs to a daemon that has been replaced.
         if (result == EAGAIN && !path_has_changed(log))
             return result;
         syslog_socket_close(log); // the daemon has ended or been replaced
@@ -181,6 +187,8 @@ size_t format_head(const syslog_socket *log, int32_t level, char *line, size_t s
     char process[16] = "";
     if (log->with_pid)
         snprintf(process, sizeof process, "[%d]", static_cast<int>(getpid()));
+    // The number in angle brackets is the priority: the facility, which has its low three bits clear, and the
+    // level.
     return static_cast<size_t>(snprintf(line, size, "<%d>%s %2d %02d:%02d:%02d %s%s: ", log->facility | level,
                                         months[local.tm_mon], local.tm_mday, local.tm_hour, local.tm_min,
                                         local.tm_sec, log->ident, process));
@@ -196,6 +204,7 @@ int syslog_socket_vsend(syslog_socket *log, int32_t level, const char *format, v
     const size_t head = format_head(log, level & LOG_PRIMASK, line, sizeof line);
     va_list again;
     va_copy(again, arguments);
+    // The time functions above may have changed it, and the format may contain "%m".
     errno = saved_errno;
     const int text = vsnprintf(line + head, sizeof line - head, format, arguments);
     const size_t length = text < 0 ? head : head + static_cast<size_t>(text);

@@ -35,6 +35,8 @@ uint64_t size_for_need(const tbuffer *buffer, uint64_t need) {
         size = std::max(size, need);
         size = round_size(std::min(size, need + tb_size_max_extra_growth));
     }
+    // More than the growth factor above the need, so that a buffer that has just grown doesn't shrink at
+    // once.
     if (buffer->auto_shrink && size > (need * 3 + 3) * 2 + 1)
         size = round_size(need);
     return size;
@@ -207,6 +209,7 @@ lc_status tb_clear(tbuffer *buffer) {
 lc_status tb_delete_bytes(tbuffer *buffer, uint32_t offset, uint32_t count) {
     CHECK_NULL(buffer);
     CHECK_CONDITION(!buffer->constant);
+    // In two comparisons, since the sum of the two could overflow.
     if (offset > buffer->length || count > buffer->length - offset)
         FAIL_WITH(LC_NO_BUFFER_SPACE);
     memmove(buffer->buffer + offset, buffer->buffer + offset + count, buffer->length - offset - count);
@@ -228,6 +231,7 @@ lc_status tb_put_buf(tbuffer *buffer, uint32_t offset, const void *bytes, uint32
             CHECK_CONDITION(source < buffer->buffer || source >= buffer->buffer + buffer->size);
             CHECK_QUIET(adapt_buffer_size(buffer, end + 1));
         }
+        // These bytes may be left over from a time when the buffer was longer.
         if (offset > buffer->length)
             memset(buffer->buffer + buffer->length, 0, offset - buffer->length);
     }
@@ -289,6 +293,7 @@ uint32_t swap_if(uint32_t number, int swap) {
 lc_status put_counted_text(tbuffer *buffer, uint32_t offset, int add_nul, int length_word, int swap,
                            const char *text, uint32_t length, uint32_t *out_written) {
     CHECK_CONDITION(length < tb_size_max && offset < tb_size_max);
+    // The length word includes the NUL, which `length` doesn't.
     const uint32_t counted = length + (add_nul ? 1 : 0);
     uint32_t at = offset;
     if (length_word) {

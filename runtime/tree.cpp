@@ -14,6 +14,7 @@ void free_no_value(void *) {}
 
 void free_node(void *memory) {
     auto *node = static_cast<tree_node *>(memory);
+    // Also frees a node that new_node could only make in part; each field may still be null.
     (void)array_free(&node->children);
     if (node->value)
         node->owner->options.free_value(node->value);
@@ -72,6 +73,7 @@ lc_status tree_new(tree **out, const tree_options *options) {
 namespace {
 
 void drop_value(tree_node *node) {
+    // Cleared first: the function that frees the value must not find it in the tree any more.
     void *value = node->value;
     node->value = nullptr;
     if (value)
@@ -98,6 +100,7 @@ lc_status tree_free(tree **inout) {
 namespace {
 
 tree_node *find_child(const tree_node *node, const char *name) {
+    // A key with nothing but the name; comparing looks at no other field.
     tree_node key{};
     key.name = const_cast<char *>(name);
     uint32_t index = 0;
@@ -141,6 +144,7 @@ lc_status tree_set_node_value_by_path_str(tree *whole, tree_node *start, const c
             CHECK_STATUS(make_child(node, name, &next));
         node = next;
     }
+    // Setting the value that the node has already must not free it.
     if (node->value != value)
         drop_value(node);
     node->value = value;
@@ -159,6 +163,8 @@ lc_status tree_get_node_by_path_wildcarded(const tree *whole, const tree_node *s
         const char *name = tstr_array_get_str_quick(parts, i);
         CHECK_NULL(name);
         tree_node *next = find_child(node, name);
+        // A child with the literal name is preferred, and the search never returns to the wildcard if it then
+        // finds nothing below that child.
         if (!next && wildcard)
             next = find_child(node, wildcard);
         if (!next)

@@ -56,6 +56,7 @@ lc_status tstr_array_new_packed(tstr_array **out, uint32_t count, size_t text_by
     array_options options;
     CHECK_STATUS(array_options_get_defaults(&options));
     string_options(&options);
+    // Slots and records need the alignment of a pointer. The texts, which need none, come last.
     const size_t slots = sizeof(packed), records = slots + count * sizeof(void *);
     const size_t texts = records + count * sizeof(tstring);
     auto *memory = static_cast<uint8_t *>(malloc(texts + text_bytes));
@@ -112,12 +113,14 @@ lc_status tstr_array_wildcard_match(const tstr_array *pattern, const tstr_array 
         *out_matched = pattern_count == count;
         return LC_OK;
     }
+    // Even a final "**" needs at least one part.
     if (pattern_count > count)
         return LC_OK;
     for (uint32_t i = 0; i < pattern_count; i++) {
         const tstring *wanted = tstr_array_get_quick(pattern, i);
         if (ts_equal(wanted, tstr_array_get_quick(parts, i)) || ts_equal_str(wanted, "*", 0))
             continue;
+        // "**" matches all parts from here on. What follows it in the pattern isn't compared any more.
         *out_matched = ts_equal_str(wanted, "**", 0);
         return LC_OK;
     }

@@ -26,6 +26,7 @@
 namespace {
 
 lc_status allocate_own_bytes(tstring *string, uint32_t size) {
+    // Bytes inside a block can't be reallocated. They are copied, and stay in the block unused.
     const bool placed = string->placed & ts_placed_bytes;
     auto *buffer = static_cast<char *>(placed ? malloc(size) : realloc(string->buffer, size));
     CHECK_NULL(buffer);
@@ -48,6 +49,7 @@ uint32_t shrunk_size(uint32_t size, uint64_t need) {
 }
 
 lc_status adapt_string_size(tstring *string, int64_t length) {
+    // One byte more for the NUL; a string never has less than its first size.
     const int64_t need = std::max<int64_t>(length + 1, ts_size_initial);
     if (need > ts_size_max) {
         LC_LOG(LC_LOG_ERR, "maximum size exceeded: %d",
@@ -88,6 +90,7 @@ lc_status replace_bytes(tstring *string, int32_t at, int32_t removed, const char
     memmove(string->buffer + at + added, string->buffer + at + removed, static_cast<size_t>(rest));
     if (added > 0)
         memcpy(string->buffer + at, bytes, static_cast<size_t>(added));
+    // Compared before the length is changed below.
     const bool shorter = length < string->length;
     end_string_at(string, static_cast<int32_t>(length));
     return shorter ? adapt_string_size(string, length) : LC_OK;
@@ -257,6 +260,7 @@ lc_status ts_dup(const tstring *string, tstring **out) {
         return ts_new(out);
     owned<tstring, ts_release> copy;
     CHECK_STATUS(ts_new(&copy.pointer));
+    // Set first, so that the characters are counted when the bytes are copied.
     copy.pointer->utf8 = string->utf8;
     CHECK_STATUS(replace_bytes(copy.pointer, 0, 0, string->buffer, string->length));
     *out = copy.take();
@@ -348,6 +352,7 @@ lc_status ts_rfind_char(const tstring *string, int32_t start, char byte, int32_t
     *out_offset = -1;
     CHECK_NULL(string);
     int32_t end = string->length;
+    // Up to the end of the character at `start`, which may be the one that is searched.
     if (start >= 0 && start < string->characters)
         CHECK_STATUS(byte_offset(string, start + 1, &end));
     const void *found = memrchr(string->buffer, byte, static_cast<size_t>(end));
@@ -504,6 +509,7 @@ lc_status ts_trim_tail(tstring *string, char tail) {
 int ts_cmp(const tstring *a, const tstring *b) {
     if (!a || !b)
         return (a ? 0 : 1) - (b ? 0 : 1);
+    // By bytes also in UTF-8, where that is the order of the code points.
     const int order = memcmp(a->buffer, b->buffer, static_cast<size_t>(std::min(a->length, b->length)));
     return order ? order : (a->length > b->length) - (a->length < b->length);
 }

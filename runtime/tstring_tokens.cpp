@@ -55,6 +55,7 @@ lc_status scan_text(const token_syntax &syntax, const char *text, tstr_array *to
     for (const char *at = text; *at; at++) {
         const char c = *at;
         behind_separator = false;
+        // An escape at the end of the text has nothing to escape, and is an ordinary character.
         if (syntax.escape && c == syntax.escape && at[1]) {
             // Before any other character the escape itself is part of the token.
             if (!syntax.escapable(at[1]))
@@ -161,6 +162,7 @@ lc_status join_tokens(const token_syntax &syntax, const tstr_array *array, tstri
     CHECK_NULL(array);
     CHECK_CONDITION(syntax.separator || !syntax.flags);
     const uint32_t count = tstr_array_length_quick(array);
+    // Room for all tokens and separators, and for one escape per 16 bytes. More escapes make the string grow.
     uint64_t sum = uint64_t{count} + 4;
     for (uint32_t i = 0; i < count; i++)
         if (const tstring *token = tstr_array_get_quick(array, i))
@@ -170,6 +172,7 @@ lc_status join_tokens(const token_syntax &syntax, const tstr_array *array, tstri
     owned<tstring, ts_release> string;
     CHECK_STATUS(ts_new_size(&string.pointer, static_cast<uint32_t>(sum)));
     CHECK_STATUS(write_tokens(syntax, array, string.pointer));
+    // An empty first token has left a separator at the start already.
     if ((syntax.flags & ts_join_leading) && string.pointer->buffer[0] != syntax.separator)
         CHECK_STATUS(ts_insert_char(string.pointer, 0, syntax.separator));
     const int32_t length = string.pointer->length;

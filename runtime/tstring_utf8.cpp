@@ -18,6 +18,7 @@ int32_t sequence_length(uint8_t lead) {
         return 1;
     if (lead < 0xc0 || lead > 0xfd)
         return 0;
+    // Sequences of five and six bytes, which current UTF-8 no longer has, are accepted as well.
     return lead < 0xe0 ? 2 : lead < 0xf0 ? 3 : lead < 0xf8 ? 4 : lead < 0xfc ? 5 : 6;
 }
 
@@ -35,6 +36,7 @@ void log_bytes(const char *text, int32_t bytes) {
     owned<tstring, ts_release> list;
     if (!lc_log_check_level(LC_LOG_WARNING) || ts_new(&list.pointer) != LC_OK)
         return;
+    // The text comes from outside, and may be long.
     for (int32_t i = 0; i < bytes && ts_length(list.pointer) < 1024; i++) {
         const uint8_t byte = static_cast<uint8_t>(text[i]);
         const char *separator = i ? " " : "";
@@ -59,6 +61,7 @@ namespace {
 
 lc_status step_over_characters(const char *text, int32_t bytes, int32_t characters, int32_t *out_bytes) {
     int32_t at = 0;
+    // A negative number of characters means all.
     for (int32_t i = 0; characters < 0 ? at < bytes : i < characters; i++) {
         const int32_t length = character_length(text + at, bytes - at);
         if (length == 0) {
@@ -85,6 +88,7 @@ uint32_t utf8_decode(const char *text, int32_t bytes) {
     const int32_t length = character_length(text, bytes);
     if (length <= 1)
         return length == 1 ? static_cast<uint8_t>(text[0]) : 0;
+    // The lead byte of a sequence of n bytes has n ones and a zero before its payload.
     uint32_t value = static_cast<uint8_t>(text[0]) & (0x7fu >> length);
     for (int32_t i = 1; i < length; i++)
         value = (value << 6) | (static_cast<uint8_t>(text[i]) & 0x3f);
@@ -97,6 +101,7 @@ locale_t utf8_locale;
 pthread_once_t utf8_locale_once = PTHREAD_ONCE_INIT;
 
 uint32_t fold_case(uint32_t character) {
+    // towlower() in the process's own locale, normally "C", would only know ASCII.
     pthread_once(&utf8_locale_once,
                  [] { utf8_locale = newlocale(LC_CTYPE_MASK, "C.UTF-8", static_cast<locale_t>(nullptr)); });
     return utf8_locale ? towlower_l(character, utf8_locale) : towlower(character);
@@ -106,6 +111,7 @@ uint32_t fold_case(uint32_t character) {
 
 int utf8_equal_ignoring_case(const char *a, const char *b) {
     while (*a && *b) {
+        // No sequence is longer than six bytes, and one that is cut short ends at the NUL.
         const int32_t a_length = character_length(a, static_cast<int32_t>(strnlen(a, 6)));
         const int32_t b_length = character_length(b, static_cast<int32_t>(strnlen(b, 6)));
         if (!a_length || !b_length ||

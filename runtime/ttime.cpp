@@ -54,6 +54,7 @@ lt_time_us lt_tm_to_time_us(const tm *local) {
         (void)lc_check_null(__func__, LC_FILE_NAME, __LINE__);
         return 0;
     }
+    // mktime normalises the record that it is given.
     tm copy = *local;
     return int64_t{mktime(&copy)} * US_PER_SEC;
 }
@@ -108,11 +109,13 @@ lc_status format_time(char *buffer, uint32_t size, size_t at, const char *format
 void append_fraction(char *buffer, uint32_t size, size_t *at, int64_t value) {
     // Also of a negative value the fraction counts forward from the whole second before it.
     const int64_t fraction = ((value % US_PER_SEC) + US_PER_SEC) % US_PER_SEC;
+    // The longest fraction takes seven characters; a buffer that is nearly full does without.
     if (fraction == 0 || *at + 9 > size)
         return;
     char text[16];
     const double seconds = static_cast<double>(fraction) / static_cast<double>(US_PER_SEC);
     const int length = snprintf(text, sizeof text, fraction % US_PER_MS ? "%.6lf" : "%.3lf", seconds);
+    // Without the "0" before the point; the NUL is copied as well.
     memcpy(buffer + *at, text + 1, static_cast<size_t>(length));
     *at += static_cast<size_t>(length) - 1;
 }
@@ -293,6 +296,7 @@ lc_status lt_str_to_daytime_us(const char *text, lt_time_us *out) {
     *out = 0;
     CHECK_NULL(text);
     char whole[64];
+    // The first day of the epoch, read as UTC: the result is the offset from midnight.
     const int length = snprintf(whole, sizeof whole, "1970/1/1 %s", text);
     if (length < 0 || static_cast<size_t>(length) >= sizeof whole)
         return LC_BAD_TYPE;
@@ -353,6 +357,7 @@ lc_status lt_timezone_handle_changed() {
         unsetenv("TZ");
     }
     const time_t now = time(nullptr);
+    // Not localtime_r(), which need not look at TZ again.
     (void)localtime(&now);
     CHECK_STATUS(status);
     return LC_OK;
