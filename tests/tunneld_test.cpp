@@ -61,6 +61,7 @@ void write_mem_conf() {
 struct Tunneld : testing::Test {
     static void SetUpTestSuite() {
         write_mem_conf();
+        std::filesystem::create_directories(std::filesystem::path(WCCPD_FILE).parent_path());
         EXPECT_FALSE(take_one(&before_wccpd));
         EXPECT_FALSE(before_wccpd.attached);
         mailbox = static_cast<wccp_tunnel_mailbox *>(
