@@ -263,9 +263,11 @@ int spawn_command(const std::string &file, pid_t *out_pid) {
 // Reaps a killed command if it ends before the deadline. Otherwise init reaps it after this program's end.
 void wait_for_killed(pid_t pid, int pidfd, int64_t deadline_ms) {
     pollfd end = {pidfd, POLLIN, 0};
-    (void)poll(&end, 1, static_cast<int>(std::max<int64_t>(deadline_ms - lt_monotonic_ms(), 0)));
+    if (pidfd >= 0) // poll() would sleep until the deadline
+        (void)poll(&end, 1, static_cast<int>(std::max<int64_t>(deadline_ms - lt_monotonic_ms(), 0)));
     (void)waitpid(pid, nullptr, WNOHANG);
-    close(pidfd);
+    if (pidfd >= 0)
+        close(pidfd);
 }
 
 std::string begin_command(watched_proxy *self) {
