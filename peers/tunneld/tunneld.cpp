@@ -168,10 +168,11 @@ bool has_ends(const command_desk &desk, const tunnel_ends &ends) {
 }
 
 // `wanted`, or the next lower one that is free; below 0 it wraps around.
-uint16_t find_free_tunnel_id(const command_desk &desk, uint16_t wanted) {
+uint16_t find_free_tunnel_id(const tunneld &daemon, uint16_t wanted) {
     // Ends, since there are far fewer tunnels than ids.
     for (uint16_t id = wanted;; id--)
-        if (!desk.tunnels.contains(id))
+        if (!daemon.desk.tunnels.contains(id) &&
+            std::ranges::none_of(daemon.lingering, [id](const auto &each) { return each.tunnel.id == id; }))
             return id;
 }
 
@@ -188,15 +189,15 @@ void let_links_linger(tunneld *daemon) {
         if (daemon->active_ms >= 0 && link.wish.kind == link_kind::tunnel && !known &&
             !has_ends(daemon->desk, ends))
             daemon->lingering.push_back(
-                {{find_free_tunnel_id(daemon->desk, link.wish.tunnel_id), ends}, until_ms});
+                {{find_free_tunnel_id(*daemon, link.wish.tunnel_id), ends}, until_ms});
     }
 }
 
 // Makes the tunnels of the command table.
 void apply_tunnels(tunneld *daemon) {
     let_links_linger(daemon);
-    daemon->applied
-        .reset(); // an unchanged table too: wccpd may order a tunnel again that others have removed
+    // An unchanged table is applied as well: wccpd may order a tunnel again that others have removed.
+    daemon->applied.reset();
     reconcile_now(daemon);
 }
 
