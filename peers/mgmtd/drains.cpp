@@ -223,8 +223,6 @@ void server_forget_deleted_drains(server *self) {
     }
 }
 
-namespace {} // namespace
-
 int64_t server_end_drains(server *self) {
     const int64_t now = self->now_ms();
     int64_t next = -1;

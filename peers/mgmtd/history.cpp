@@ -106,8 +106,10 @@ bool read_entry(const std::string &path, history_entry *out, std::string *out_te
     std::optional<std::string> content;
     if (!read_whole_file(path, &content, out_reason))
         return false;
+    if (content && parse_entry(*content, out, out_text))
+        return true;
     *out_reason = content ? "is not a commit that mgmtd has written" : "there is no such file";
-    return content && parse_entry(*content, out, out_text);
+    return false;
 }
 
 // --- The directory

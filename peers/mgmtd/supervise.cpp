@@ -137,13 +137,14 @@ void start_child(supervisor *self, child *process) {
     }
     process->waits = false;
     const char *failed = fork_child(process);
+    const int error = errno;
     // Only this copy: the child's descriptor keeps the lock.
     if (process->lock >= 0)
         close(process->lock);
     process->lock = -1;
     process->started_ms = self->now_ms();
     if (failed) {
-        const std::string reason = strerror(errno);
+        const std::string reason = strerror(error);
         // Counts as a run of no length; the failure may be a lack of memory or processes that passes.
         process->delay_ms = next_delay(process->delay_ms, 0);
         process->start_at_ms = process->started_ms + process->delay_ms;
