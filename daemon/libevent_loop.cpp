@@ -122,6 +122,7 @@ void take_loop_lock(loop_lock *lock, uint32_t count) {
 void give_loop_lock(loop_lock *lock, uint32_t count) {
     const mutex_guard guard(&lock->mutex);
     lock->count -= count;
+    // One waiter is enough: it wakes the next one when it gives the lock back.
     if (!lock->count)
         pthread_cond_signal(&lock->freed);
 }
@@ -145,12 +146,14 @@ namespace {
 
 void queue_event(loop_event *event, short flags) {
     loop_context *context = event->context;
+    // An event that is in the queue keeps its place; only its flags are added.
     const bool queued = event->queued_flags != 0;
     event->queued_flags = static_cast<short>(event->queued_flags | flags);
     if (queued)
         return;
     event->next_queued = nullptr;
     event->previous_queued = context->queue_last;
+    // The link that has to refer to the event: its predecessor's, or the queue's first.
     (context->queue_last ? context->queue_last->next_queued : context->queue_first) = event;
     context->queue_last = event;
 }
@@ -198,6 +201,7 @@ void queue_ready_events(loop_context *context) {
 
 void count_event(loop_event *event, bool in) {
     loop_context *context = event->context;
+    // Adding ~0u subtracts 1.
     const uint32_t step = in ? 1u : ~0u;
     event->inserted = in;
     context->inserted += step;
@@ -237,6 +241,7 @@ lc_status loop_event_set_fd(loop_event *event, int fd, short flags) {
     CHECK_NULL(event);
     CHECK_CONDITION(fd >= 0 && !(flags & ~(LOOP_READ | LOOP_WRITE)));
     const loop_guard guard(event->context);
+    // Also necessary for libevent: event_assign must not be called for a pending event.
     loop_event_remove(event);
     event->kind = event_kind::descriptor;
     event->number = fd;
@@ -278,6 +283,7 @@ struct sigaction earlier_actions[LEW_SIGNAL_MAX + 1];
 pthread_mutex_t signal_table_mutex = PTHREAD_MUTEX_INITIALIZER;
 
 void write_signal_message(int number, siginfo_t *, void *) {
+    // The handler interrupts code that may be about to read errno.
     const int saved = errno;
     const loop_context *context = le_signal_contexts[number].load();
     if (context) {
@@ -308,6 +314,7 @@ lc_status take_signal(loop_context *context, int number) {
     sigemptyset(&set);
     sigaddset(&set, number);
     pthread_sigmask(SIG_BLOCK, &set, nullptr); // before the handler exists
+    // Before the handler is installed, which reads it.
     le_signal_contexts[number] = context;
     if (sigaction(number, &action, &earlier_actions[number]) != 0) {
         le_signal_contexts[number] = nullptr;
@@ -387,6 +394,7 @@ namespace {
 // Reads all messages from the self-pipe: numbers of signals, or 0 for a plain wake-up.
 void read_wake_pipe(loop_context *context) {
     char message[MESSAGE_BYTES];
+    // Writes of up to PIPE_BUF bytes are atomic; therefore the pipe has only whole messages.
     while (read(context->pipe_read, message, sizeof message) == static_cast<ssize_t>(sizeof message)) {
         int number = 0;
         memcpy(&number, message, sizeof number);
@@ -413,6 +421,7 @@ lc_status wake_owner(loop_context *context) {
 // --- Work posted by other threads
 
 void loop_post_work(loop_context *context, loop_post *post) {
+    // Cancelled between the list and the wake-up, the poster would leave its work waiting for the next event.
     const cancel_off_guard cancel_off;
     post->next = nullptr;
     bool first;
@@ -422,6 +431,7 @@ void loop_post_work(loop_context *context, loop_post *post) {
         (context->posts_last ? context->posts_last->next : context->posts_first) = post;
         context->posts_last = post;
     }
+    // A later post finds the wake-up of the first one still pending.
     if (first)
         LOG_STATUS(wake_owner(context));
 }
@@ -473,6 +483,7 @@ void loop_withdraw_posted(loop_context *context, const void *poster) {
         }
         context->posts_last = kept_last;
     }
+    // Without the posts' mutex, because the functions may free the posts or post again.
     while (loop_post *post = withdrawn) {
         withdrawn = post->next;
         post->function(post, 0);
@@ -493,6 +504,7 @@ lc_status wait_for_events(loop_context *context) {
     // limit_event ends a wait that no timer would end.
     if (!without_waiting && !context->timers && event_add(context->limit_event, &limit) != 0)
         FAIL_WITH(LC_GENERIC);
+    // A copy: another thread may register a signal during the wait, and exactly these are blocked again.
     const sigset_t signals = context->owned_signals;
     const uint32_t held = context->lock.count; // stable, because this thread holds the lock
     give_loop_lock(&context->lock, held);
@@ -553,6 +565,7 @@ lc_status loop_escape(loop_context *context) {
         const loop_guard guard(context);
         context->escape = 1;
     }
+    // The owner itself tests the flag before its next wait.
     if (!loop_is_own_thread(context))
         CHECK_STATUS(wake_owner(context));
     return LC_OK;
@@ -571,8 +584,10 @@ event_base *make_event_base() {
     event_config *config = event_config_new();
     if (!config)
         return nullptr;
+    // The file's header explains why not epoll; select cannot handle descriptors of 1024 and above.
     event_config_avoid_method(config, "epoll");
     event_config_avoid_method(config, "select");
+    // Variables of the environment could otherwise exclude poll.
     event_config_set_flag(config, EVENT_BASE_FLAG_IGNORE_ENV);
     event_base *base = event_base_new_with_config(config);
     event_config_free(config);
@@ -590,6 +605,7 @@ loop_context *loop_new() {
     pthread_mutex_init(&context->posts_mutex, nullptr);
     sigemptyset(&context->owned_signals);
     int ends[2];
+    // The signal handler must not block, and the reader stops when the pipe is empty.
     if (pipe2(ends, O_CLOEXEC | O_NONBLOCK) != 0) {
         LC_LOG(LC_LOG_ERR, "pipe system call failed");
         free(context);
@@ -602,6 +618,7 @@ loop_context *loop_new() {
         exit_with_message(__func__, "no event mechanism available");
     context->pipe_event =
         event_new(context->base, context->pipe_read, EV_READ | EV_PERSIST, handle_ready_pipe, context);
+    // A timer: no descriptor and no other flags.
     context->limit_event = event_new(context->base, -1, 0, handle_wait_limit, nullptr);
     if (!context->pipe_event || !context->limit_event || event_add(context->pipe_event, nullptr) != 0)
         exit_with_message(__func__, "couldn't allocate event context");
@@ -613,6 +630,7 @@ void loop_free(loop_context **inout) {
     *inout = nullptr;
     if (!context)
         return;
+    // With 0 the functions only free their posts and do not do the work.
     while (loop_post *post = take_first_post(context))
         post->function(post, 0);
     event_free(context->limit_event);

@@ -54,6 +54,7 @@ lc_status lew_init(lew **out) {
     *out = nullptr;
     auto *context = static_cast<lew *>(calloc(1, sizeof(lew)));
     CHECK_NULL(context);
+    // On failure the array may exist already; the loop does not.
     const lc_status status = init_context(context);
     if (status != LC_OK) {
         LOG_STATUS(array_free(&context->slots));
@@ -75,6 +76,7 @@ lc_status lew_get_event_context(lew *context, loop_context **out) {
 namespace {
 
 lc_status find_slot(const lew *context, lew_event **slot, uint32_t *out_place) {
+    // The key is the address of the slot, not what it holds.
     return array_binary_search(context->slots, slot, out_place);
 }
 lc_status add_slot(lew *context, lew_event **slot) {
@@ -92,6 +94,7 @@ lc_status make_signal_event(lew *context, lew_event **slot) {
     CHECK_NULL(event);
     event->context = context;
     lc_status status = loop_event_new(context->loop, lew_universal_event_handler, event, &event->registered);
+    // The array keeps the address of the slot; the event itself is set only when nothing can fail any more.
     if (status == LC_OK)
         status = add_slot(context, slot);
     if (status != LC_OK) {
@@ -123,6 +126,7 @@ lc_status lew_event_reg_signal(lew *context, lew_event **slot, int signal_number
     (*slot)->callback = callback;
     (*slot)->data = data;
     const lc_status status = loop_event_set_signal((*slot)->registered, signal_number);
+    // Deleting the address frees the event and clears the slot.
     if (status != LC_OK && made && find_slot(context, slot, &place) == LC_OK)
         LOG_STATUS(array_delete(context->slots, place));
     CHECK_STATUS(status);
@@ -161,6 +165,7 @@ lc_status lew_delete_all_events(lew *context) {
 namespace {
 
 lc_status run_dispatch(lew *context, bool once, int *out_no_events, int *out_escaped) {
+    // The caller's outputs may be null; loop_run needs both.
     int no_events = 0, escaped = 0;
     if (out_no_events)
         *out_no_events = 0;
@@ -196,6 +201,7 @@ lc_status lew_deinit(lew **inout) {
     lew *context = *inout;
     if (!context)
         return LC_OK;
+    // Sets all slots to null, while the loop that the events belong to still exists.
     CHECK_STATUS(lew_delete_all_events(context));
     CHECK_STATUS(array_free(&context->slots));
     loop_free(&context->loop);

@@ -161,6 +161,7 @@ lc_status wccpd_config_update_group(const char *id_text, const config_walk *walk
         return LC_OK;
     }
     config.group_id = id;
+    // Nodes that are absent leave their fields 0; without `admin` the group is added but not started.
     CHECK_STATUS(take_group_nodes(walk, root, &config));
     if (wccp_add_group(&config) == 0)
         QV_LOG(LC_LOG_INFO, "Created WCCP group %d", id);
@@ -177,6 +178,7 @@ lc_status wccpd_config_update_policy_group(const bn_binding_array *bindings, con
     bool deleted = false;
     CHECK_STATUS(read_root_deleted_mark(bindings, root, &deleted));
     if (!deleted) {
+        // This only publishes the role; the members follow with the nodes of their groups.
         if (wccp_add_policy_grp(id, 0, nullptr) == 0)
             QV_LOG(LC_LOG_INFO, "WCCP update: Added policy Group %d", id);
         else
@@ -213,6 +215,7 @@ lc_status walk_policy_groups(const bn_binding_array *bindings, config_change_tim
 }
 
 lc_status walk_groups(const bn_binding_array *bindings, config_change_time time, uint32_t *out_count) {
+    // The extra element is for an empty array: calloc(0) may return null, as if there were no memory.
     owned<void, bn_free_memory> counts(
         calloc(bn_binding_array_length_quick(bindings) + size_t{1}, sizeof(uint32_t)));
     CHECK_NULL(counts.pointer);
@@ -230,6 +233,7 @@ lc_status change_facility(const bn_binding *binding) {
     uint32_t facility = 0;
     CHECK_STATUS(bn_binding_get_uint32(binding, bn_attrib_value, nullptr, &facility));
     const char *name = lc_enum_to_string(lc_log_facility_table, static_cast<int32_t>(facility));
+    // Facilities are multiples of 8 in syslog's numbers.
     LC_LOG(LC_LOG_INFO, "system facility to %d(%s), %s", static_cast<int>(facility >> 3), name,
            wccpd_program_name);
     (void)lc_log_file(nullptr, "system facility set to %s, %s", name, wccpd_program_name);
@@ -269,6 +273,7 @@ lc_status change_group(const char *name, const tstr_array *parts, const bn_bindi
     constexpr uint32_t GROUP_PART = 5, NODE_PART = 6, NODE_PARTS = 7;
     const char *id_text = tstr_array_get_str_quick(parts, GROUP_PART);
     const uint8_t id = static_cast<uint8_t>(id_text ? strtol(id_text, nullptr, 10) : 0);
+    // Deeper nodes, such as router entries, have more parts.
     const char *last =
         tstr_array_length_quick(parts) == NODE_PARTS ? tstr_array_get_str_quick(parts, NODE_PART) : nullptr;
     const group_node *node = last ? find_changing_node(last) : nullptr;
@@ -291,6 +296,7 @@ lc_status change_group(const char *name, const tstr_array *parts, const bn_bindi
     }
     wccp_grp_config config = {};
     config.group_id = id;
+    // For a node without a flag, such as policy_grp, `take` does everything, and there is nothing to modify.
     if (node)
         CHECK_STATUS(node->take(node, &config, binding));
     if (wccp_modify_grp(&config) != 0)
@@ -307,6 +313,7 @@ lc_status wccpd_config_handle_change(bn_binding_array *, uint32_t, bn_binding *b
     owned_tstr_array parts;
     CHECK_STATUS(bn_binding_name_to_parts(name, &parts.pointer, nullptr));
     LC_LOG(LC_LOG_INFO, "%s: updating %s", __func__, name);
+    // The facility is not below wccpd's own nodes, therefore it is handled before the filter.
     if (strcmp(name, NODE_SYSTEM_FACILITY) == 0) {
         CHECK_STATUS(change_facility(binding));
         return LC_OK;
@@ -370,12 +377,14 @@ lc_status wccpd_config_query() {
     CHECK_STATUS(query_nodes(NODE_SYSTEM_CONFIG)); // the system mode takes effect before there are groups
     CHECK_STATUS(query_nodes(NODE_WCCPD_CONFIG));
     (void)qv_init_log_level(wccpd_mcc); // without it the levels stay as they are
+    // Policy groups come before the service groups that join them.
     CHECK_STATUS(query_roots(NODE_POLICY_CONFIG, walk_policy_groups));
     CHECK_STATUS(query_roots(NODE_GROUP_CONFIG, walk_groups));
     return LC_OK;
 }
 
 lc_status wccpd_config_apply(bn_binding_array *new_values, config_change_time time) {
+    // An event may also carry the log levels.
     (void)qv_handle_log_level_change(new_values);
     uint32_t count = 0;
     CHECK_STATUS(walk_policy_groups(new_values, time, &count));

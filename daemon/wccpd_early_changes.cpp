@@ -45,6 +45,7 @@ early_change *take_first_change() {
     if (!change)
         return nullptr;
     kept_changes.first = change->next;
+    // The list is empty: the next change is linked from its head again.
     if (!kept_changes.first)
         kept_changes.end = &kept_changes.first;
     return change;
@@ -74,6 +75,7 @@ bool early_changes_are_kept() {
 lc_status keep_early_change(bn_binding_array **inout_new_values) {
     CHECK_CONDITION(early_changes_are_kept());
     const size_t bytes = estimate_bytes(*inout_new_values);
+    // The sum never exceeds the maximum; therefore the difference cannot wrap.
     if (bytes > EARLY_CHANGES_MAX_BYTES - kept_changes.bytes) {
         LC_LOG(LC_LOG_ERR,
                "Configuration change lost: too many changes arrived during the start; restart wccpd");
@@ -81,6 +83,7 @@ lc_status keep_early_change(bn_binding_array **inout_new_values) {
     }
     early_change *change = static_cast<early_change *>(calloc(1, sizeof *change));
     CHECK_NULL(change);
+    // From here on the list owns the array.
     change->new_values = *inout_new_values;
     change->time = CONFIG_CHANGE_DURING_START;
     *inout_new_values = nullptr;
@@ -91,6 +94,7 @@ lc_status keep_early_change(bn_binding_array **inout_new_values) {
 }
 
 void early_changes_are_answered() {
+    // All changes so far have arrived before the answer.
     for (early_change *change = kept_changes.first; change; change = change->next)
         change->time = CONFIG_CHANGE_IN_ANSWER;
 }

@@ -44,6 +44,7 @@ lc_status take_word(const group_node *node, wccp_grp_config *config, const bn_bi
     for (const group_node_words::word &word : node->words->list)
         if (strcmp(word.text, string) == 0)
             value = word.value;
+    // No word has the value 0.
     if (value == 0) {
         node->words->complain(string);
         value = node->words->fallback;
@@ -130,6 +131,7 @@ lc_status take_policy(const group_node *, wccp_grp_config *config, const bn_bind
     CHECK_STATUS(bn_binding_get_uint32(binding, bn_attrib_value, nullptr, &value));
     const uint16_t policy = static_cast<uint16_t>(value);
     const uint8_t id = config->group_id;
+    // The removal first: it clears the engine's record of the membership, even that of a newer one.
     if (svc_grp_policy[id] != 0)
         (void)wccp_remove_policy_grp(svc_grp_policy[id], id);
     svc_grp_policy[id] = policy; // also if the next step fails
@@ -225,6 +227,7 @@ void forget_policy_memberships() {
 }
 
 void leave_policy_group(uint8_t group_id) {
+    // For a group without a policy group, number 0, this removes nothing.
     (void)wccp_remove_policy_grp(svc_grp_policy[group_id], group_id);
     svc_grp_policy[group_id] = 0;
 }
@@ -233,6 +236,7 @@ void move_policy_members(uint16_t from, uint16_t to) {
     for (uint32_t group = 0; group < WCCP_MAX_GROUPS; group++) {
         if (svc_grp_policy[group] != from)
             continue;
+        // The engine has dropped the earlier membership together with the policy group.
         const uint8_t member = static_cast<uint8_t>(group);
         svc_grp_policy[group] = to;
         (void)wccp_add_policy_grp(to, 1, &member);

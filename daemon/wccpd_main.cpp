@@ -112,6 +112,7 @@ lc_status wccpd_handle_signal(int signal_number, short, void *, lew *) {
     for (const wccpd_signal &known : wccpd_signals) {
         if (known.number != signal_number)
             continue;
+        // SIGPIPE, SIGUSR1 and SIGUSR2 are only logged: their default actions would end the process.
         if (known.ends_daemon)
             CHECK_STATUS(wccpd_initiate_exit());
         return LC_OK;
@@ -121,6 +122,7 @@ lc_status wccpd_handle_signal(int signal_number, short, void *, lew *) {
 }
 
 uint32_t qv_encap_setup_entries() {
+    // Each range has 32 ids, as many as wccp_tunnel.cpp has bits for them.
     const uint32_t base = get_max_tunnel_number();
     g_qv_encap_wccp_first = base + 10;
     g_qv_encap_wccp_last = base + 41;
@@ -133,6 +135,7 @@ lc_status wccpd_pid_init() {
     char text[16];
     const int length = snprintf(text, sizeof text, "%d\n", static_cast<int>(getpid()));
     LOG_STATUS(lf_ensure_dir_of_file(WCCPD_PID_FILE, 0755));
+    // A failure need not be one of a system call; 0 then shows that errno says nothing.
     errno = 0;
     const lc_status status = lf_write_file(WCCPD_PID_FILE, 0644, text, 1, static_cast<uint32_t>(length));
     if (status != LC_OK) {
@@ -154,6 +157,7 @@ lc_status wccpd_serv_init() {
 }
 
 lc_status wccpd_init() {
+    // The modes of files and sockets are exactly those that the code states.
     umask(0);
     const int32_t facility = lc_log_get_facility(nullptr, wccpd_program_name);
     CHECK_STATUS(lc_log_init(wccpd_program_name, nullptr, 0, WCCPD_LOG_COMPONENT, LC_LOG_DEBUG, facility, 1));
@@ -168,12 +172,14 @@ lc_status wccpd_init() {
     for (wccpd_signal &known : wccpd_signals)
         CHECK_STATUS(
             lew_event_reg_signal(wccpd_lwc, &known.slot, known.number, wccpd_handle_signal, nullptr));
+    // From before the session is opened, so that no change is missed.
     const early_changes_scope early_changes;
     for (lc_status (*step)() : wccpd_start_steps) {
         CHECK_STATUS(step());
         if (wccpd_shutdown_in_progress())
             return LC_CANCELLED;
     }
+    // Before the daemon is ready: from then on changes are applied as they arrive.
     apply_early_changes();
     g_qv_encap_entry_count = qv_encap_setup_entries();
     LC_LOG(LC_LOG_NOTICE, "%s: encap entries:%d wccp start %d/%d clstr start %d/%d", "wccpd_init",
@@ -192,10 +198,12 @@ lc_status wccpd_main_loop() {
 }
 
 lc_status wccpd_initiate_exit() {
+    // First: it ends all waits, and the tick, receive threads and notifications stop working.
     wccpd_exiting = 1;
     service_report("STOPPING=1");
     wccp_alarms_clear_all();
     LOG_STATUS(qv_initiate_exit());
+    // One of these may be the registration whose callback is running.
     for (wccpd_signal &known : wccpd_signals)
         CHECK_STATUS(lew_event_delete(wccpd_lwc, &known.slot));
     CHECK_STATUS(wccpd_mgmt_shutdown());
@@ -210,6 +218,7 @@ lc_status wccpd_initiate_exit() {
 lc_status wccpd_deinit() {
     CHECK_STATUS(wccpd_mgmt_deinit());
     CHECK_STATUS(qv_alm_mgmt_deinit());
+    // Deletes the groups and ends the engine's threads.
     (void)wccp_exit_mgr();
     wccpd_service_deinit();
     CHECK_STATUS(lew_deinit(&wccpd_lwc));
@@ -217,6 +226,7 @@ lc_status wccpd_deinit() {
 }
 
 int wccpd_main() {
+    // A limit that is too low is reported by wccpd_report_missing_privileges.
     (void)mlockall(MCL_CURRENT | MCL_FUTURE);
     // All mapped memory is locked. By default each thread that allocates maps an arena of 64 MB, and malloc
     // raises its mmap threshold to the largest block freed so far, which after the answers of the start would
@@ -232,6 +242,7 @@ int wccpd_main() {
     service_open();
     LOG_STATUS(wccpd_init());
     LOG_STATUS(wccpd_main_loop());
+    // Failures of the start or of the loop do not show in the exit code; those of the clean-up do.
     const lc_status code = wccpd_deinit();
     LOG_STATUS(code);
     LC_LOG(LC_LOG_NOTICE, "WCCP daemon exiting with code %d", code);

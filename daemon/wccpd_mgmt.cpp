@@ -65,6 +65,7 @@ lc_status wccpd_mgmt_handle_query_request(gcl_session *session, bn_request_msg *
         LC_LOG(LC_LOG_INFO, "Discard event req because init not ready");
         return LC_OK;
     }
+    // One of its nodes is enough to make the whole request a walk, or a quiet one.
     wccpd_mon_request how = {};
     for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(request->nodes); i++) {
         const bn_request_node *node = bn_request_per_node_array_get_quick(request->nodes, i);
@@ -83,6 +84,7 @@ lc_status wccpd_mgmt_handle_action_request(gcl_session *session, bn_request_msg 
     owned_tstring name;
     CHECK_STATUS(bn_action_request_msg_get_action_name(request, &name.pointer));
     LC_LOG(LC_LOG_INFO, "Received action %s", ts_str(name.pointer));
+    // Every action is acknowledged, because its sender waits; none has an effect.
     owned_response response;
     CHECK_STATUS(bn_action_response_msg_create(
         &response.pointer, static_cast<uint32_t>(bn_request_get_msg_id(request)), 0, nullptr));
@@ -92,11 +94,13 @@ lc_status wccpd_mgmt_handle_action_request(gcl_session *session, bn_request_msg 
 
 lc_status wccpd_process_proc_fail(const char *event_name, const bn_binding_array *bindings) {
     LC_LOG(LC_LOG_INFO, "Processing proc event: %s", event_name);
+    // The first binding has the name of the process.
     bn_binding *first = bn_binding_array_get_quick(bindings, 0);
     if (!first)
         return LC_OK;
     owned_tstring process;
     CHECK_STATUS(bn_binding_get_tstr(first, bn_attrib_value, bn_type_str, nullptr, &process.pointer));
+    // Other programs may end without consequences for wccpd.
     if (!process.pointer || strcmp(ts_str(process.pointer), "tunneld") != 0)
         return LC_OK;
     LC_LOG(LC_LOG_INFO, "WCCP: Detected that tunneld has exited");
@@ -168,6 +172,7 @@ lc_status wccpd_mgmt_register_interests() {
         "match/2/pattern", static_cast<uint32_t>(bn_type_str), NODE_SYSTEM_MODE "/**", //
         "match/3/pattern", static_cast<uint32_t>(bn_type_str), "/logging/**",          //
         "match/4/pattern", static_cast<uint32_t>(bn_type_str), NODE_SYSLOG_FACILITY "/**"));
+    // Without a pattern the interest covers all events of that name.
     static const char *const process_events[] = {
         EVENT_PROCESS_CRASH,
         EVENT_PROCESS_EXIT,
@@ -194,6 +199,7 @@ lc_status wccpd_mgmt_open_session() {
 
 lc_status wccpd_mgmt_init() {
     CHECK_STATUS(mgmt_client_init(&wccpd_client, wccpd_mgmt_handle_session_close));
+    // All callbacks first: messages may arrive as soon as the session is open.
     CHECK_STATUS(
         bn_set_global_callback_query_response_msg(wccpd_gcl_handle, wccpd_mgmt_handle_response, nullptr));
     CHECK_STATUS(

@@ -104,6 +104,7 @@ long get_number_part(const mon_subject *subject, uint32_t index) {
 }
 
 void ask_reason(mon_subject *subject, bool *answered) {
+    // The same nodes exist for each group and for packets that belong to none.
     const bool of_group = wccpd_is_under(subject->name, NODE_GROUP_STATE);
     const auto place =
         static_cast<uint32_t>(get_number_part(subject, of_group ? NUMBER_PART : SYSTEM_ENTRY_PART));
@@ -118,6 +119,7 @@ void ask_counter(mon_subject *subject, bool *answered) {
 
 void ask_interface(mon_subject *subject, bool *answered) {
     const char *name = tstr_array_get_str_quick(subject->parts, SYSTEM_ENTRY_PART);
+    // One by one without a lock: interfaces are never removed, so their indexes stay valid.
     for (uint32_t i = 0; name && wccp_get_interface_info(i, &subject->interface) == 0; i++)
         if (strcmp(subject->interface.name, name) == 0)
             return;
@@ -263,6 +265,7 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
     if (!wccpd_is_under(subject->name, NODE_GROUP_STATE))
         return LC_OK;
     subject->group = static_cast<uint8_t>(get_number_part(subject, GROUP_PART));
+    // The number as it is in the name, for the prefixes below; the engine takes its low 8 bits.
     const char *group_text = tstr_array_get_str_quick(subject->parts, GROUP_PART);
     const int group = static_cast<int>(group_text ? strtol(group_text, nullptr, 10) : 0);
     // These are prefixes of text and therefore also match the parent nodes; the numbers are then 0.
@@ -276,6 +279,7 @@ lc_status ask_engine(mon_subject *subject, bool *answered) {
             return LC_OK;
         }
     } else {
+        // A number that is not in the list leaves the record empty; only an unknown group is a failure.
         subject->router.router_num = static_cast<uint32_t>(get_number_part(subject, NUMBER_PART));
         CHECK_STATUS(wccp_get_grp_router_info(subject->group, &subject->router));
         snprintf(router_appliances, sizeof router_appliances, "%s/%d/router/%d/appliance", NODE_GROUP_STATE,
@@ -316,11 +320,13 @@ lc_status append_dump(const mon_subject *subject, const mon_node *node, const wc
         LC_LOG(LC_LOG_ERR, "%s: malloc failed", __func__);
         return LC_OK;
     }
+    // The descriptor lies at the end of this memory and is freed with it.
     csys_display_buf *buffer = csys_create_safe_display_buf_desc(memory.pointer, dump->size);
     CHECK_NULL(buffer);
     const dump_failures_logged_at level(request.quiet     ? LC_LOG_DEBUG
                                         : request.in_walk ? LC_LOG_INFO
                                                           : LC_LOG_ERR); // for this dump
+    // A dump that did not fit has no value, except where the beginning is useful by itself.
     if (dump->print(buffer, subject->group) != 0 && !dump->cut_text_counts)
         return LC_OK;
     CHECK_STATUS(append_binding(subject->name, node->type, csys_display_buf_text(buffer), out));
@@ -346,6 +352,7 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
     const char *last = count ? tstr_array_get_str_quick(name_parts, count - 1) : nullptr;
     CHECK_NULL(last);
     LC_LOG(level, "MonGet: last_name_part=%s", last);
+    // Answered without the engine: such a node exists for every number or name.
     for (const char *pattern : wildcard_nodes)
         if (name_matches(&subject, pattern)) {
             CHECK_STATUS(wccpd_mon_handle_get_wildcard(&subject, last, out));
@@ -355,6 +362,7 @@ lc_status wccpd_mon_handle_get(const char *node_name, const tstr_array *name_par
     CHECK_STATUS(ask_engine(&subject, &answered));
     if (!answered)
         return LC_OK;
+    // The general answer is there; some rows ask one more question.
     for (const mon_node &node : mon_nodes) {
         if (!name_matches(&subject, node.pattern))
             continue;
@@ -431,6 +439,7 @@ lc_status iterate_other_reasons(const mon_subject *, tstr_array *out) {
 }
 
 lc_status iterate_counters(const mon_subject *, tstr_array *out) {
+    // All groups have the same counters.
     for (uint32_t i = 0; wccp_counter_word(i); i++)
         CHECK_STATUS(append_name(out, wccp_counter_word(i)));
     return LC_OK;

@@ -51,8 +51,10 @@ bool may_reach_mgmtd(char *out_missing) {
     char path[sizeof(sockaddr_un::sun_path)];
     gcl_socket_path("provider", "mgmtd", path, sizeof path);
     struct stat about;
+    // If the directory cannot be searched, the caller's text, which is there already, names the cause.
     if (stat(path, &about) != 0)
         return errno != EACCES;
+    // With the effective ids, which connect() is checked against.
     if (faccessat(AT_FDCWD, path, W_OK, AT_EACCESS) == 0)
         return true;
     snprintf(out_missing, TEXT_BYTES, "running as root or as user %u, like mgmtd: %s: %s",
@@ -63,10 +65,12 @@ bool may_reach_mgmtd(char *out_missing) {
 bool (*const privileges[])(char *out_missing) = {may_lock_memory, may_reach_mgmtd};
 
 void report_alive(int, short, void *) {
+    // Without waiting: the main thread must not stop when the engine does.
     if (pthread_mutex_trylock(&wccp_g.lock) == 0) {
         pthread_mutex_unlock(&wccp_g.lock);
         service_report("WATCHDOG=1");
     }
+    // Timers run once; this starts the next period.
     LOG_STATUS(loop_event_set_timer(alive_timer, service_watchdog_ms() / CHECKS_IN_LIMIT));
 }
 

@@ -49,6 +49,7 @@ lc_status choose_interface_name(const char *mode, const char **out_name) {
         *out_name = "bwan0";
         return LC_OK;
     }
+    // Any mode that begins with this word.
     if (strncmp(mode, "server", 6) == 0) {
         *out_name = "mgmt0";
         return LC_OK;
@@ -77,6 +78,7 @@ lc_status read_system_mode(owned_tstring *out) {
 
 int wccp_is_system_in_bridge_mode() {
     owned_tstring mode;
+    // Without an answer the engine runs as in router mode.
     if (read_system_mode(&mode) != LC_OK)
         return 0;
     QV_LOG(LC_LOG_INFO, "WCCP current system mode: %s", ts_str(mode.pointer));
@@ -85,6 +87,7 @@ int wccp_is_system_in_bridge_mode() {
 
 lc_status wccp_init_primary_wan_interface() {
     bool present = false;
+    // An absent node leaves the default, without bonding.
     CHECK_STATUS(read_bool_node(wccpd_mcc, NODE_SYSTEM_BONDING, &bonding_enabled, &present));
     if (present)
         LC_LOG(LC_LOG_INFO, "bonding_enabled: %s", lc_bool_to_str(bonding_enabled));

@@ -52,10 +52,12 @@ uint64_t milliseconds_since_boot() {
 
 void *thread_main(void *argument) {
     auto *context = static_cast<cthread *>(argument);
+    // The kernel's thread names have at most 15 characters; pthread_setname_np refuses longer ones.
     char kernel_name[16];
     strlcpy(kernel_name, context->name, sizeof kernel_name);
     pthread_setname_np(pthread_self(), kernel_name);
 
+    // On Linux each thread has its own nice value; 0 is the calling one.
     if (context->policy == SCHED_OTHER && setpriority(PRIO_PROCESS, 0, context->priority) != 0)
         QV_LOG(LC_LOG_ERR, "%s: can't set priority for thread %s\n", __func__, context->name);
     cpu_set_t cpus;
@@ -97,7 +99,9 @@ int build_thread_attributes(pthread_attr_t *attributes, const cthread *context) 
         return 1;
     const int policy = static_cast<int>(context->policy);
     sched_param parameters = {};
+    // SCHED_OTHER accepts only 0; thread_main applies the nice value.
     parameters.sched_priority = policy == SCHED_OTHER ? 0 : context->priority;
+    // Without PTHREAD_EXPLICIT_SCHED the creator's policy would be inherited and these attributes ignored.
     if (pthread_attr_setstacksize(attributes, CTHREAD_STACK_BYTES) == 0 &&
         pthread_attr_setinheritsched(attributes, PTHREAD_EXPLICIT_SCHED) == 0 &&
         pthread_attr_setschedpolicy(attributes, policy) == 0 &&
@@ -121,6 +125,7 @@ int cthread_start(cthread *context) {
         pthread_attr_destroy(&context->attributes);
         return 1;
     }
+    // Only from here on can the thread be cancelled and joined.
     context->heartbeat = milliseconds_since_boot();
     const mutex_guard guard(&thread_list_mutex);
     list_push_head(&thread_list, context);

@@ -78,6 +78,7 @@ lc_status qv_alm_mgmt_msg_handler(void *, gcl_session *, bn_request_msg *request
 lc_status qv_alm_mgmt_handle_session_close(int, uint32_t, void *, void *) {
     if (qv_exiting)
         return LC_OK;
+    // Ends the wait for an answer, if there is one.
     qv_response_expected = 0;
     LC_LOG(LC_LOG_ERR, "Lost connection to mgmtd; exiting");
     CHECK_STATUS(qv_initiate_exit());
@@ -125,10 +126,12 @@ lc_status start_alarm_session(const char *client_name) {
 
 // Ends the wait of the main thread. It may be waiting in its loop; posting work that does nothing wakes it.
 void report_start() {
+    // Static, because it must exist until the main loop has run it.
     static loop_post wake = {nullptr, nullptr, [](loop_post *, int) {}};
     loop_context *main_loop = nullptr;
     if (!start_semaphore_exists)
         return;
+    // First the post, then the wake-up: the main thread checks the semaphore when it wakes.
     sem_post(&start_semaphore);
     if (wccpd_lwc && lew_get_event_context(wccpd_lwc, &main_loop) == LC_OK)
         loop_post_work(main_loop, &wake);
@@ -171,6 +174,7 @@ void wait_for_start() {
     while ((has_loop ? sem_trywait(&start_semaphore) : sem_wait(&start_semaphore)) != 0) {
         if (!has_loop)
             continue; // interrupted by a signal
+        // The exit, nested in the dispatch below, has joined the alarm thread: nobody posts any more.
         if (wccpd_shutdown_in_progress())
             return;
         has_loop = lew_dispatch_once(wccpd_lwc, &no_events, nullptr) == LC_OK && !no_events;
@@ -198,6 +202,7 @@ lc_status qv_alm_mgmt_init(const char *client_name) {
 
 lc_status qv_alm_mgmt_shutdown() {
     LC_LOG(LC_LOG_INFO, "qv_alm_mgmt_shutdown: cancel alm thread");
+    // The thread ends when its loop returns; it is not cancelled.
     if (lew *loop = get_alarm_loop())
         CHECK_STATUS(lew_escape_from_dispatch(loop));
     if (alarm_thread_runs && !pthread_equal(alarm_thread, pthread_self())) { // it cannot join itself

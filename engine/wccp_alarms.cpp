@@ -92,6 +92,7 @@ struct event_field {
 // freed before the engine's threads have ended.
 template <size_t Count>
 lc_status send_event(const char *event, const event_field (&fields)[Count]) {
+    // Keeps the session from being freed while the message is sent.
     const mutex_guard guard(&qv_alm_session_mutex);
     if (!qv_alm_mgmt_session)
         return LC_NULL;
@@ -142,6 +143,7 @@ bool alarm_is_active(const wccp_service_group *group, uint16_t bit) {
 void wccp_alarm_raise_router_down_alarm(wccp_service_group *group) {
     if (!alarm_is_active(group, WCCP_ALARM_ADJACENCY))
         wccp_alarm_raise_alarm(group, WCCP_ALARM_ADJACENCY);
+    // The check that can clear the alarm again follows a full delay later.
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 1);
 }
 
@@ -190,6 +192,7 @@ int wccp_alarm_verify_router_connectivity(wccp_service_group *group) {
     // How many routers answer a multicast address is not known.
     const uint32_t expected = group->mcast_configured == 1 ? 1 : group->ucast_router_count;
     const bool healthy = one_way == 0 && two_way >= expected;
+    // An alarm is sent only when it changes.
     const bool raised = alarm_is_active(group, WCCP_ALARM_ADJACENCY);
     if (healthy && raised) {
         QV_LOG(LC_LOG_INFO,
@@ -232,6 +235,7 @@ void note_assignment_difference(wccp_service_group *group, const wccp_sending_ro
 bool routers_use_our_table(wccp_service_group *group) {
     for (uint32_t i = 0; i < WCCP_MAX_APPLIANCES; i++) {
         const wccp_dsg_appliance *asked = &group->dsg_appliances[i];
+        // Entries that are not in use have 0 slots.
         if (asked->assigned == 0)
             continue;
         for (wccp_sending_router *router = group->sending_routers; router; router = router->next) {
@@ -251,6 +255,7 @@ bool routers_use_our_table(wccp_service_group *group) {
             return false;
         }
     }
+    // The loop above has not compared appliances that the table leaves out.
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next) {
         for (uint32_t i = 0; i < router->view_appliance_count; i++) {
             const wccp_rtr_view_appliance *entry = &router->view_appliances[i];

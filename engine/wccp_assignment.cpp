@@ -220,6 +220,7 @@ void wccp_compute_assignment_table(uint32_t count, wccp_dsg_appliance *entries, 
         QV_LOG(LC_LOG_ERR, "Computing assignment table failed: out of memory");
         return;
     }
+    // The caller's array is a copy; the group's own entries keep the order that bucket_index refers to.
     qsort(entries, count, sizeof *entries, compare_address_words);
     uint32_t active_count = 0, active_weight = 0;
     be32 fallback = {};
@@ -241,6 +242,7 @@ void wccp_compute_assignment_table(uint32_t count, wccp_dsg_appliance *entries, 
     if (active_weight == 0) { // nothing to split by
         compute_u8_assignment_array(1, &fallback, &FALLBACK_WEIGHT, slots, table);
     } else {
+        // Down entries take part, so that every slot lies where it lay while they were up.
         compute_u8_assignment_array(count, all.pointer, all_weights.pointer, slots, table);
         for (uint32_t i = 0; i < count; i++) { // only the runs of down entries are split again
             if (entries[i].up)
@@ -269,6 +271,7 @@ void compute_u8_assignment_array(uint32_t count, const be32 *identifiers, const 
     if (total_weight == 0)
         return;
     const uint32_t num_buckets = slots;
+    // At most 32 x 65535 x 256, which fits in 32 bits.
     uint32_t running = 0, k = 0;
     for (uint32_t i = 0; i < count; i++) {
         running += weights[i] * slots; // rounding each quotient down passes the remainder on to later entries
@@ -276,6 +279,7 @@ void compute_u8_assignment_array(uint32_t count, const be32 *identifiers, const 
         shares.pointer[i] = quotient - k;
         k = quotient;
     }
+    // The texts that the assertions print are fixed, and clang-format would add spaces to them.
     // clang-format off
     assert(k==num_buckets);
     k = 0;
@@ -284,15 +288,17 @@ void compute_u8_assignment_array(uint32_t count, const be32 *identifiers, const 
             table[k++] = identifiers[i];
     assert(k==num_buckets);
     // clang-format on
-    (void)num_buckets;
+    (void)num_buckets; // otherwise unused with NDEBUG
 }
 
 void scramble_u8_array(uint32_t slots, be32 *table, uint32_t seed) {
     unsigned state = seed;
     for (uint32_t i = slots; i-- > 0;) {
         const uint64_t r = static_cast<uint64_t>(rand_r(&state));
+        // The random number has 31 bits; therefore j is below i, or 0.
         const uint64_t j = (r * i) >> 31;
         const be32 moved = table[i];
+        // For small values only: an address would lose all but its lowest byte.
         table[i] = from_raw_word(raw_word(table[j]) & 0xff);
         table[j] = moved;
     }

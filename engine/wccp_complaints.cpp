@@ -24,6 +24,7 @@ namespace {
 
 // Takes one line from the budget; false when it is used up.
 bool take_from_budget(wccp_complaint_budget *budget) {
+    // In 64 bits, because the time since the last complaint can be years.
     const uint64_t refill = uint64_t{LINES_PER_SECOND} * (wccp_g.seconds - budget->refill_time);
     budget->refill_time = wccp_g.seconds;
     budget->spent = refill < budget->spent ? budget->spent - static_cast<uint32_t>(refill) : 0;
@@ -36,6 +37,7 @@ bool take_from_budget(wccp_complaint_budget *budget) {
 } // namespace
 
 bool wccp_may_complain() {
+    // Only lines about received packets are limited.
     if (!current_interface)
         return true;
     wccp_complaint_budget *budget = &current_interface->complaints;
@@ -51,6 +53,7 @@ void wccp_report_suppressed_complaints() {
         wccp_complaint_budget *budget = &wccp_g.interfaces[i].complaints;
         const bool goes_on = budget->suppressed != budget->suppressed_at_tick;
         budget->suppressed_at_tick = budget->suppressed;
+        // Reported when a tick has suppressed nothing, which ends the flood, and every minute while it lasts.
         if (budget->suppressed == 0 || (goes_on && wccp_g.seconds - budget->suppressed_since < REPORT_PERIOD))
             continue;
         (void)take_from_budget(budget); // this line is always logged, but counts

@@ -83,6 +83,7 @@ void set_masks(wccp_service_group *group, const wccp_grp_config *config, uint32_
 void set_password(wccp_service_group *group, const wccp_grp_config *config) {
     memset(group->password, 0, sizeof group->password);
     group->security_option = config->password[0] ? 1 : 0;
+    // The configured password has been padded with zeros; its ninth byte, a NUL, is not copied.
     if (group->security_option)
         memcpy(group->password, config->password, sizeof group->password);
 }
@@ -111,6 +112,7 @@ void clear_agreement(wccp_service_group *group) {
     group->assign_method = WCCP_ASSIGN_NONE;
     group->ret_method = WCCP_METHOD_NONE;
     group->change_number = 0;
+    // All of them: the state, the agreement, and a pending election.
     group->state_flags = 0;
     wccp_clear_assignment_block(group);
     group->redirecting_routers = 0;
@@ -118,6 +120,7 @@ void clear_agreement(wccp_service_group *group) {
 
 template <typename T>
 void free_records(T **head, uint32_t *count) {
+    // Each unlink advances the head.
     while (T *record = *head) {
         list_unlink(record);
         wccp_free(record);
@@ -150,6 +153,7 @@ wccp_interface *find_or_add_interface(const wccp_grp_config *config) {
     snprintf(name, sizeof name, "%.*s", static_cast<int>(sizeof name - 1), config->interface);
     const wccp_engine_lock lock;
     wccp_interface *interface = wccp_if_find_interface(name);
+    // A new group is a reason to try a failed set-up again.
     if (interface)
         recover_once_per_second(interface);
     else
@@ -218,6 +222,7 @@ int wccp_add_group(const wccp_grp_config *config) {
     list_push_head(&wccp_g.group_list, group);
     wccp_g.group_count++;
     wccp_if_add_group(group, interface);
+    // A failed join is not undone: the group stays and is started when a later attempt succeeds.
     if (group->mcast_configured && wccp_join_mc_grp(interface, group->mcast_ipa)) {
         wccp_note_network(group);
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: cannot join %s on interface %s yet", group->id,
@@ -234,11 +239,13 @@ void wccp_start_service_group(wccp_service_group *group) {
     clear_agreement(group);
     wccp_forget_all_reasons(group);
     group->start_time = wccp_g.seconds;
+    // The state was cleared above; therefore this always enters INIT and reports its role.
     wccp_appliance_state_init(group);
     if (group->admin_state != WCCP_ADMIN_UP) {
         QV_LOG(LC_LOG_NOTICE, "WCCP GRP %d: not started (admin disabled)", group->id);
         return;
     }
+    // Also for a group that cannot start yet: its routers are missing all the same.
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 0);
     wccp_note_network(group);
     if (!wccp_if_is_ready(group->interfaces[0])) {
@@ -273,6 +280,7 @@ void wccp_stop_service_group(wccp_service_group *group) {
     wccp_note_network(group); // the interface may be the cause of the stop
     group->start_time = wccp_g.seconds;
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 1);
+    // As at the start, this always reports the role.
     wccp_appliance_state_init(group);
 }
 
@@ -299,6 +307,7 @@ void remove_group(wccp_service_group *group, bool clear_alarms) {
     wccp_if_remove_group(group);
     wccp_flush_group_lists(group);
     wccp_set_role_and_send_event(group->id, WCCP_ROLE_UNKNOWN);
+    // At exit the alarms have been cleared before, on a session that has been closed since.
     if (clear_alarms)
         wccp_alarms_clear_all_raised_alarms(group);
     free_group(group);
@@ -320,6 +329,7 @@ int wccp_del_group(int id) {
 
 int wccp_del_all_groups() {
     const wccp_engine_lock lock;
+    // By number, because each removal changes the list.
     for (wccp_service_group *group : wccp_g.groups)
         if (group)
             remove_group(group, false);
@@ -350,6 +360,7 @@ int wccp_disable_group(wccp_service_group *group, const wccp_grp_config *) {
 }
 
 int wccp_set_grp_weight(wccp_service_group *group, const wccp_grp_config *config) {
+    // The next Here-I-Am carries it. The table changes when the routers report it back.
     group->weight = config->weight;
     return 0;
 }
@@ -386,6 +397,7 @@ int wccp_set_fwd_method(wccp_service_group *group, const wccp_grp_config *config
 }
 
 int wccp_set_force_l2_rtn(wccp_service_group *group, const wccp_grp_config *config) {
+    // The next start of the group passes it on to tunneld.
     group->force_l2_return = config->force_l2_return;
     return 0;
 }
@@ -455,6 +467,7 @@ const modify_row modify_rows[] = {
 int wccp_modify_grp(const wccp_grp_config *config) {
     if (!config)
         return 1;
+    // A modification has a single flag, and the first row that matches is carried out.
     for (const modify_row &row : modify_rows) {
         if ((config->config_flags & row.config_flags) == 0 || (row.applies && !row.applies(config)))
             continue;
@@ -468,6 +481,7 @@ int wccp_modify_grp(const wccp_grp_config *config) {
 }
 
 int wccp_set_mcast_ttl(uint32_t ttl) {
+    // With a TTL of 0 the messages would not leave the host.
     const uint8_t wanted = (ttl & 0xff) ? static_cast<uint8_t>(ttl & 0xff) : MCAST_TTL_FOR_ZERO;
     const wccp_engine_lock lock;
     if (wanted == wccp_g.mcast_ttl)
@@ -504,6 +518,7 @@ void wccp_start_service_groups_by_interface(wccp_interface *interface) {
 void wccp_start_waiting_groups(wccp_interface *interface) {
     if (!wccp_if_is_ready(interface))
         return;
+    // Running groups are left alone, because a start would make them forget their routers.
     for (wccp_service_group *group = interface->groups; group; group = group->if_next)
         if (group->admin_state == WCCP_ADMIN_UP && !wccp_group_is_running(group))
             wccp_start_service_group(group);

@@ -24,6 +24,7 @@ int wccp_print_service_grp_assignment_global(const wccp_service_group *group, cs
     wccp_piece piece = wccp_assignment_piece(buffer);
     wccp_piece_add(&piece, "\n\t%-26s\n", "Assignment");
     wccp_piece_add(&piece, "\t%-26s : ", "Configured HASH");
+    // The words are in the order of the bits of the service flags.
     for (uint32_t bit = 0; bit < 4; bit++)
         if (group->service_flags & (1U << bit))
             wccp_piece_add(&piece, "%s", hash_words[bit]);
@@ -34,6 +35,7 @@ int wccp_print_service_grp_assignment_global(const wccp_service_group *group, cs
                    group->mask_dst_port);
     wccp_piece_add(&piece, "\t%-26s : %s\n", "Configured assign. method",
                    name_assign_method(group->cfg_assign_method, 4));
+    // `either` is not the result of a negotiation, and would be shown as unknown.
     wccp_piece_add(&piece, "\t%-26s : %s\n", "Negotiated assign. method",
                    name_assign_method(group->assign_method, 3));
     WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));
@@ -45,6 +47,7 @@ void put_bucket_set(wccp_piece *piece, const wccp_service_group *group, be32 app
     for (uint32_t i = 0; i < WCCP_MAX_BUCKETS; i++)
         if (group->bucket_ipa[i] == appliance)
             words[i / 32] |= 1U << (i % 32);
+    // From the highest bucket down: bucket 0 is the last bit of the second line.
     for (int top = 7; top > 0; top -= 4)
         wccp_piece_add(piece, "\t%-26s : 0x%08x %08x %08x %08x\n", "", words[top], words[top - 1],
                        words[top - 2], words[top - 3]);
@@ -75,6 +78,7 @@ int print_mask_values(const wccp_service_group *group, wccp_piece *piece) {
 int wccp_print_service_grp_assignment_designator(const wccp_service_group *group, csys_display_buf *buffer) {
     wccp_piece piece = wccp_assignment_piece(buffer);
     wccp_piece_add(&piece, "\n\t%-26s", "Designator allocation");
+    // Only the designated appliance has a table of its own.
     if (group->designated != 1) {
         wccp_piece_add(&piece, " : not the designator \n\n");
         WCCP_BAIL_ON_ZERO(wccp_piece_flush(&piece));

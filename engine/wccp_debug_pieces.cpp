@@ -24,6 +24,7 @@ void wccp_piece_add(wccp_piece *piece, const char *format, ...) {
     va_start(arguments, format);
     const int length = vsnprintf(piece->text + piece->used, piece->size - piece->used, format, arguments);
     va_end(arguments);
+    // When it truncates, vsnprintf returns the length of the whole text.
     if (length > 0) {
         const uint32_t room = piece->size - piece->used - 1;
         piece->used += static_cast<uint32_t>(length) < room ? static_cast<uint32_t>(length) : room;

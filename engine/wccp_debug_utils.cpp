@@ -31,6 +31,7 @@ void put_countdown(wccp_piece *piece, const wccp_timer *timer) {
     wccp_piece_add(piece, "%u (seconds)", timer->active == 1 ? timer->countdown : 0);
 }
 void put_swapped_words(wccp_piece *piece, const uint32_t *words) {
+    // Swapped, so that the first byte on the wire, with buckets 0 to 7, is printed last in its word.
     wccp_piece_add(piece, "0x%08x %08x %08x %08x", __builtin_bswap32(words[0]), __builtin_bswap32(words[1]),
                    __builtin_bswap32(words[2]), __builtin_bswap32(words[3]));
 }
@@ -89,6 +90,7 @@ const char *dump_state_name(uint32_t state_flags) {
 }
 
 void put_password(wccp_piece *p, const wccp_service_group *g) {
+    // A password of 8 bytes has no terminating NUL.
     wccp_piece_add(p, "%.*s ", static_cast<int>(strnlen(g->password, sizeof g->password)), g->password);
     for (const char byte : g->password)
         wccp_piece_add(p, "0x%x, ", static_cast<unsigned>(static_cast<uint8_t>(byte)));
@@ -209,6 +211,7 @@ const router_row router_rows[] = {
      }},
     {"WCCP router received id",
      [](wccp_piece *p, const wccp_sending_router *r) { wccp_piece_add(p, "0x%x", to_host(r->receive_id)); }},
+    // Printed as stored, in wire order.
     {"WCCP router change number",
      [](wccp_piece *p, const wccp_sending_router *r) {
          wccp_piece_add(p, "%u", raw_word(r->change_number));

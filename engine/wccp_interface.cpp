@@ -48,12 +48,14 @@ wccp_interface *wccp_if_add_interface(const char *name) {
     }
     wccp_interface *interface = &wccp_g.interfaces[wccp_g.if_count];
     clear_interface(interface);
+    // A name of 16 bytes or more is cut, and no device has it.
     strlcpy(interface->name, name, sizeof interface->name);
     const bool primary = strncmp(interface->name, wccp_primary_wan_interface_name, WCCP_IF_NAME_BYTES) == 0;
     interface->ipa = wccp_get_address(interface->name);
-    // The primary interface is here whether a group uses it or not: its absence is worth no warning.
+    // The primary interface is in the table even if no group uses it; a missing one is not worth a warning.
     if (!primary || wccp_get_device(interface->name) != 0)
         interface->link_up = wccp_get_if_status(interface->name);
+    // The entry counts, and can be found, only from here on.
     wccp_g.if_count++;
     if (primary)
         wccp_g.primary_if = interface;
@@ -61,6 +63,7 @@ wccp_interface *wccp_if_add_interface(const char *name) {
         interface->ready_flags |= WCCP_LINK_READY;
     if (!is_zero(interface->ipa)) {
         interface->ready_flags |= WCCP_IPA_READY;
+        // A failure is noted in the interface and tried again later.
         wccp_init_network_by_interface(interface);
     }
     return interface;
@@ -73,6 +76,7 @@ int wccp_if_add_group(wccp_service_group *group, wccp_interface *interface) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: max number of interfaces has reached for this group", group->id);
         return 1;
     }
+    // By hand, because the list functions expect members called next and prev_link.
     group->if_next = interface->groups;
     group->if_prev_link = &interface->groups;
     if (interface->groups)

@@ -45,6 +45,7 @@ int wccp_init_link_mgr() {
             QV_LOG(LC_LOG_ERR, "WCCP: network init: %s add interface failed.",
                    wccp_primary_wan_interface_name);
     }
+    // Only now, because callbacks may run at once, on another thread.
     int result = qv_register_netlink_notifier(QV_NOTIFY_LINK_STATE, wccp_process_if_state_change);
     if (result != 0) {
         QV_LOG(LC_LOG_ERR, "WCCP: netlink link state registration failed.");
@@ -88,6 +89,7 @@ void wccp_process_if_state_change(const void *argument) {
         QV_LOG(LC_LOG_INFO, "WCCP Link event for %s is ignored.", name);
         return;
     }
+    // Both are needed: a link without IFF_UP carries nothing.
     const uint32_t up = info->admin_up && info->link_up ? 1 : 0;
     if (interface->link_up == up) { // still a chance to repeat a failed set-up
         wccp_recover_interface(interface);
@@ -97,6 +99,7 @@ void wccp_process_if_state_change(const void *argument) {
     QV_LOG(LC_LOG_NOTICE, up ? "WCCP: Interface %s is UP" : "WCCP: Interface %s is DOWN", interface->name);
     if (up) {
         interface->ready_flags |= WCCP_LINK_READY;
+        // Groups are started whether or not this succeeds; their reasons show what failed.
         wccp_retry_network(interface);
         wccp_start_service_groups_by_interface(interface);
     } else {
@@ -133,6 +136,7 @@ void handle_changed_address(wccp_interface *interface) {
 void handle_same_address(wccp_interface *interface) {
     if (is_zero(interface->ipa))
         return;
+    // An index that has changed means another device of the same name.
     if (interface->device == wccp_get_device(interface->name)) {
         wccp_recover_interface(interface);
         return;
@@ -156,6 +160,7 @@ void wccp_process_if_ipa_update(const void *argument) {
         QV_LOG(LC_LOG_INFO, "WCCP Link IP address change event for %s is ignored.", name);
         return;
     }
+    // The notification has only a name; the present address is asked for.
     const be32 old_ipa = interface->ipa, new_ipa = wccp_get_address(interface->name);
     if (old_ipa == new_ipa) {
         handle_same_address(interface);

@@ -21,6 +21,7 @@ namespace {
 constexpr uint32_t DEFAULT_DST_IP_MASK = 0xF00;
 
 void wccp_mask_assignment_set_bit_array_element(wccp_service_group *group, const wccp_mask &bit) {
+    // Not expected: a mask of more bits has been replaced by the default one.
     if (group->mask_bit_count >= WCCP_MAX_MASK_BITS) {
         QV_LOG(LC_LOG_ERR, "WCCP GRP %d: mask assignment: bit array: is full (%d)", group->id,
                static_cast<int>(group->mask_bit_count));
@@ -34,6 +35,7 @@ void build_bit_array(wccp_service_group *group) {
     const wccp_mask &mask = group->mask_in_use;
     const uint32_t fields[FIELDS] = {mask.dst_port, mask.src_port, mask.dst_ip, mask.src_ip};
     for (uint32_t field = 0; field < FIELDS; field++) {
+        // Each round isolates the lowest bit that is left, and clears it.
         for (uint32_t left = fields[field]; left != 0; left &= left - 1) {
             uint32_t alone[FIELDS] = {};
             alone[field] = left & (~left + 1);
@@ -53,6 +55,7 @@ void wccp_mask_assignment_generate_values(wccp_service_group *group) {
     const uint32_t count = 1u << group->mask_bit_count;
     group->mask_values[0] = {};
     for (uint32_t k = 1; k < count; k++) {
+        // The value without the lowest bit of k has been computed before: its index is smaller.
         const wccp_mask &bit = group->mask_bit_array[__builtin_ctz(k)];
         wccp_mask_value value = group->mask_values[k & (k - 1)];
         value.src_ip |= bit.src_ip;
@@ -79,6 +82,7 @@ void wccp_mask_assignment_calculate_value_table(wccp_service_group *group) {
     memset(group->mask_bit_array, 0, sizeof group->mask_bit_array);
     group->mask_value_count = 0;
     memset(group->mask_values, 0, sizeof group->mask_values);
+    // A copy, because the configured mask can change before the table is computed again.
     wccp_mask *const mask = &group->mask_in_use;
     *mask = {group->mask_src_ip, group->mask_dst_ip, group->mask_src_port, group->mask_dst_port};
     group->mask_value_bits = group->mask_bits;

@@ -21,6 +21,7 @@ constexpr struct {
     {"designated", [](const wccp_service_group *group) -> uint32_t { return group->designated == 1; }},
     {"uptime_seconds",
      [](const wccp_service_group *group) -> uint32_t {
+         // In INIT, state_time still has the time of an earlier state.
          const bool timed = (group->state_flags & (WCCP_STATE_ACTIVE | WCCP_STATE_BACKUP)) != 0;
          return timed ? wccp_g.seconds - group->state_time : 0;
      }},
@@ -41,6 +42,7 @@ int print_group_numbers(const wccp_service_group *group, wccp_piece *piece) {
 }
 
 int print_router_numbers(const wccp_sending_router *router, wccp_piece *piece) {
+    // Id, source, two-way, seconds since its I-See-You and its state, buckets of this appliance and of all.
     wccp_piece_add(piece, "router %s %s %d %u %u %u %u\n", addr_text(router->router_id).s,
                    addr_text(router->src_ipa).s, (router->flags & WCCP_RTR_TWO_WAY) != 0,
                    wccp_g.seconds - router->last_icu_time, wccp_g.seconds - router->state_time,
@@ -71,6 +73,7 @@ int wccp_print_metrics(int id, csys_display_buf *buffer) {
     wccp_service_group *group = wccp_find_group(id);
     if (!group)
         return 1;
+    // The buffer is shared with the assignment text; the lock guards both.
     wccp_piece piece = wccp_assignment_piece(buffer);
     WCCP_BAIL_ON_ZERO(print_group_numbers(group, &piece));
     for (const wccp_sending_router *router = group->sending_routers; router; router = router->next)

@@ -60,6 +60,7 @@ int start_timer_thread() {
     cthread *timer = cthread_init("WCCP_TIMER", wccp_timer_thread_fn, nullptr, nullptr, nullptr, 0, 0, 0, 0);
     if (timer && cthread_start(timer) == 0)
         return 0;
+    // The thread is not running: this only frees its context, if there is one.
     cthread_join(timer);
     QV_LOG(LC_LOG_ERR, "WCCP: Failed to spawn timer thread");
     return 1;
@@ -84,6 +85,7 @@ int wccp_init_mgr() {
         QV_LOG(LC_LOG_ERR, "WCCP: Cannot init shared memory");
         return 1;
     }
+    // Without notifications groups run with the interface states that were found when they were added.
     if (wccp_init_link_mgr())
         QV_LOG(LC_LOG_ERR, "WCCP: Cannot init link manager");
     else
@@ -95,6 +97,7 @@ int wccp_exit_mgr() {
     QV_LOG(LC_LOG_NOTICE, "WCCP: wccp manager is exiting");
     wccp_del_all_groups();
     cthread_cancel_all();
+    // Only now, because the threads were using the sockets.
     wccp_deinit_link_mgr();
     wccp_del_all_tunnels();
     return 0;
@@ -103,6 +106,7 @@ int wccp_exit_mgr() {
 int wccp_system_mode_change_event(const char *mode) {
     if (!mode)
         return 1;
+    // Leaving bridge mode starts nothing: the threads ended when it was entered.
     if (strcmp(mode, "router") == 0 || strcmp(mode, "server") == 0)
         return 0;
     if (strcmp(mode, "bridge") != 0) {
@@ -126,6 +130,7 @@ int wccp_init_network() {
 }
 
 void wccp_tick() {
+    // Without waiting for the lock, which the exit holds while it deletes the groups.
     if (wccpd_shutdown_in_progress() == 1)
         return;
     const wccp_engine_lock lock;
@@ -141,7 +146,9 @@ void wccp_tick() {
 
 void *wccp_timer_thread_fn(void *) {
     for (;;) {
+        // The sleep is relative: a tick that takes long delays the next one, and `seconds` counts ticks.
         timespec left = {.tv_sec = 1, .tv_nsec = 0};
+        // After an interruption it continues with the time that was left.
         while (clock_nanosleep(CLOCK_MONOTONIC, 0, &left, &left) == EINTR) {
         }
         wccp_tick();

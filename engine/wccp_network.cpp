@@ -83,6 +83,7 @@ int open_datagram_socket(wccp_interface *interface, const char *open_failure,
     }
     set_buffer_size(fd, SO_RCVBUFFORCE, SO_RCVBUF);
     set_buffer_size(fd, SO_SNDBUFFORCE, SO_SNDBUF);
+    // The engine lock is held while sending; a blocking socket could hold it up (wccp_packet_io.cpp).
     (void)fcntl(fd, F_SETFL, O_NONBLOCK);
     return fd;
 }
@@ -116,6 +117,7 @@ int open_multicast_socket(wccp_interface *interface) {
     const int on = 1, no_discovery = IP_PMTUDISC_DONT;
     const uint8_t ttl = wccp_g.mcast_ttl, no_loop = 0;
     const socket_option options[] = {
+        // Several interfaces may join the same group address, each with a socket of its own bound to it.
         {SOL_SOCKET, SO_REUSEADDR, &on, sizeof on, "WCCP: net init %s: Cannot set mc socket options. %m"},
         {IPPROTO_IP, IP_MULTICAST_TTL, &ttl, sizeof ttl, "WCCP: net init %s Cannot set mcast output TTL. %m"},
         {IPPROTO_IP, IP_MULTICAST_LOOP, &no_loop, sizeof no_loop,
@@ -145,6 +147,7 @@ int start_rx_thread(wccp_interface *interface) {
     snprintf(name, sizeof name, "WCCP_RX_%s", interface->name);
     cthread *thread = cthread_init(name, wccp_rx_thread_fn, interface, nullptr, nullptr, 0, 0, 0, 0);
     if (!thread || cthread_start(thread) != 0) {
+        // The thread is not running: this only frees the context, if there is one.
         cthread_join(thread);
         QV_LOG(LC_LOG_ERR, "WCCP: net init %s Failed to spawn rx thread", interface->name);
         return 1;
@@ -176,6 +179,7 @@ void *wccp_rx_thread_fn(void *argument) {
         if (received < 1)
             continue;
         pkt.length = static_cast<uint32_t>(received);
+        // A thread that is cancelled while it waits here ends before it touches the packet.
         const wccp_engine_lock lock;
         if (wccpd_shutdown_in_progress() == 1) // the thread ends when it is cancelled
             continue;
@@ -188,6 +192,7 @@ int wccp_init_network_by_interface(wccp_interface *interface) {
     wccp_close_sockets(interface);
     interface->network_flaws = 0;
     interface->network_tried = wccp_g.seconds;
+    // Without an address this is not a failure: the notification of the first one repeats the set-up.
     if (is_zero(interface->ipa)) {
         QV_LOG(LC_LOG_INFO, "WCCP: net init %s not bound (no IP address)", interface->name);
         return 0;
@@ -197,6 +202,7 @@ int wccp_init_network_by_interface(wccp_interface *interface) {
         interface->network_flaws |= WCCP_FLAW_SOCKETS;
         return 1;
     }
+    // A failed join is noted and tried again. It does not stop the unicast groups of the interface.
     wccp_config_mcast(interface);
     QV_LOG(LC_LOG_INFO, "WCCP: net init %s: sockets of %s are open", interface->name,
            addr_text(interface->ipa).s);
@@ -243,8 +249,8 @@ int wccp_join_mc_grp(wccp_interface *interface, be32 address) {
     membership.imr_multiaddr.s_addr = raw_word(address);
     membership.imr_interface.s_addr = raw_word(interface->ipa);
     if (setsockopt(interface->mcast_fd, IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof membership) == 0) {
-        if (address !=
-            interface->mcast_bound_ipa) // the kernel delivers only what is sent to the bound address
+        // The kernel delivers only what is sent to the bound address.
+        if (address != interface->mcast_bound_ipa)
             QV_LOG(LC_LOG_NOTICE,
                    "WCCP: Interface %s: the multicast socket is bound to %s, so datagrams sent to %s are not "
                    "received",
@@ -274,6 +280,7 @@ namespace {
 
 // The reason why the interface cannot carry its groups' packets. Causes come before their consequences.
 wccp_reason_code find_network_fault(const wccp_interface *interface) {
+    // The kernel is asked only about an interface that is not ready.
     if (!wccp_if_is_ready(interface) && wccp_get_device(interface->name) == 0)
         return WCCP_REASON_INTERFACE_MISSING;
     if (!(interface->ready_flags & WCCP_LINK_READY))
@@ -299,6 +306,7 @@ void wccp_note_network(wccp_service_group *group) {
             wccp_forget_reasons(group, each);
     if (fault == WCCP_REASON_NONE)
         return;
+    // Only failed socket calls have an errno. The other faults occur while the interface is not ready.
     const char *error = wccp_if_is_ready(interface) ? strerrordesc_np(interface->network_error) : "";
     wccp_note_reason(group, fault, {}, wccp_reason_value("%s", error ? error : "unknown error"),
                      wccp_reason_value("%s", interface->name));
@@ -306,8 +314,10 @@ void wccp_note_network(wccp_service_group *group) {
 
 be32 wccp_get_address(const char *name) {
     ifreq request = make_interface_request(name);
+    // Fails without a device, and with EADDRNOTAVAIL for a device without an address.
     if (ioctl(g_qvif_skfd, SIOCGIFADDR, &request) != 0)
         return {};
+    // The union has a sockaddr; a copy reads it as sockaddr_in without breaking aliasing rules.
     sockaddr_in address;
     memcpy(&address, &request.ifr_addr, sizeof address);
     return from_raw_word(address.sin_addr.s_addr);
@@ -324,6 +334,7 @@ uint32_t wccp_get_if_status(const char *name) {
         QV_LOG(LC_LOG_WARNING, "WCCP: Failed to read link status %s (%m)", name);
         return 0;
     }
+    // IFF_UP is what the administrator wants, IFF_RUNNING is what the driver reports about the link.
     const uint32_t both = IFF_UP | IFF_RUNNING;
     return (static_cast<uint32_t>(request.ifr_flags) & both) == both ? 1 : 0;
 }

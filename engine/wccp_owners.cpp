@@ -14,6 +14,7 @@ constexpr be32 NO_OWNER = {};
 // Distributes the low bits of `*inout_index` over the set bits of `mask`, lowest first, and shifts them out.
 uint32_t spread_index_bits(uint32_t mask, uint32_t *inout_index) {
     uint32_t value = 0;
+    // Each round handles the lowest bit of the mask that is left, and clears it.
     for (; mask != 0; mask &= mask - 1, *inout_index >>= 1)
         if (*inout_index & 1)
             value |= mask & (~mask + 1);
@@ -42,6 +43,7 @@ bool router_assigns_slot(const wccp_rtr_view_appliance *entry, bool by_mask, uin
 }
 
 void add_reported_owners(const wccp_sending_router *router, bool by_mask, uint32_t slots, be32 *owners) {
+    // The first router that reports an owner of a slot decides.
     for (uint32_t i = 0; i < router->view_appliance_count; i++)
         for (uint32_t slot = 0; slot < slots; slot++)
             if (owners[slot] == NO_OWNER && router_assigns_slot(&router->view_appliances[i], by_mask, slot))
@@ -82,6 +84,7 @@ int print_table_kind(const wccp_service_group *group, bool by_mask, wccp_piece *
 
 int print_owner_runs(const be32 *owners, uint32_t slots, wccp_piece *piece) {
     wccp_piece_add(piece, " owners");
+    // Runs of slots with the same owner are printed as address*length.
     for (uint32_t first = 0, next; first < slots; first = next) {
         for (next = first + 1; next < slots && owners[next] == owners[first];)
             next++;
@@ -97,6 +100,7 @@ int print_group_owners(const wccp_service_group *group, csys_display_buf *buffer
     wccp_piece piece = wccp_assignment_piece(buffer);
     WCCP_BAIL_ON_ZERO(print_table_kind(group, by_mask, &piece));
     const wccp_mask mask = wccp_mask_of_assignment(group);
+    // The mask of an assignment never has more than 7 bits; 128 slots fit in the array.
     const uint32_t slots = by_mask ? 1u << util_wccp_mask_get_bits_set(&mask) : WCCP_MAX_BUCKETS;
     be32 owners[WCCP_MAX_BUCKETS];
     if (find_slot_owners(group, by_mask, slots, owners) != 0)

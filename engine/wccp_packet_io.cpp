@@ -50,7 +50,9 @@ int32_t send_datagram(wccp_service_group *group, int fd, const wccp_pkt *pkt, be
     const auto sent = static_cast<int32_t>(
         sendto(fd, pkt->data, pkt->length, 0, reinterpret_cast<const sockaddr *>(&to), sizeof to));
     if (sent < 0) {
+        // The calls below may overwrite errno.
         const int error = errno;
+        // Thread-safe, unlike strerror; null for an unknown number.
         const char *words = strerrordesc_np(error);
         group->tx_send_errors++;
         if (wccp_note_reason(group, WCCP_REASON_SEND_FAILED, address,
@@ -99,12 +101,14 @@ int32_t wccp_tx_pkt(wccp_service_group *group, wccp_pkt *pkt) {
     }
     if (!interface->ucast_bound) // an unbound socket would send from a port of the kernel's choice
         return 0;
+    // A removal reply has a destination of its own. In all other packets it was cleared when they were built.
     if (!is_zero(pkt->ipa))
         return send_datagram(group, interface->ucast_fd, pkt, pkt->ipa);
     if (group->mcast_configured) {
         pkt->ipa = group->mcast_ipa;
         return send_datagram(group, interface->mcast_fd, pkt, pkt->ipa);
     }
+    // A failed send adds -1. Only 0, which means that there was no destination, is a failure for the caller.
     int32_t sum = 0;
     for (uint32_t i = 0; i < group->ucast_router_count; i++) {
         pkt->ipa = group->ucast_routers[i];
@@ -118,13 +122,16 @@ int32_t wccp_rx_pkt(wccp_interface *interface, wccp_pkt *pkt, uint32_t length) {
     pollfd ready[2] = {};
     {
         const mutex_guard guard(&descriptor_lock);
+        // A descriptor of -1 is ignored by poll.
         ready[MCAST] = {.fd = interface->mcast_fd, .events = POLLIN, .revents = 0};
         ready[UCAST] = {.fd = interface->ucast_fd, .events = POLLIN, .revents = 0};
     }
     if (ready[MCAST].fd == -1 && ready[UCAST].fd == -1) {
+        // Nothing wakes this thread when sockets are opened. The sleep is also a cancellation point.
         sleep(1);
         return 0;
     }
+    // After a time-out the caller calls again and copies the descriptors again, which may have been replaced.
     if (poll(ready, 2, WAIT_MS) < 1)
         return 0;
 

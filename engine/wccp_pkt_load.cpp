@@ -54,6 +54,7 @@ int wccp_pkt_load_msg_header(wccp_pkt *pkt, uint32_t type) {
     auto *header = find_room<wccp_wire_msg_header>(pkt);
     if (!header)
         return 1;
+    // The length is filled in by wccp_pkt_finish.
     *header = {.type = to_be32(type), .version = to_be16(WCCP_VERSION), .length = to_be16(0)};
     return commit_component(pkt, sizeof *header);
 }
@@ -66,6 +67,7 @@ int wccp_pkt_load_security_info_component(wccp_service_group *group, wccp_pkt *p
     if (!info)
         return 1;
     *info = {make_component_head(WCCP_SECURITY_INFO, size), to_be32(group->security_option)};
+    // The digest covers the whole message, with these bytes zero; wccp_pkt_finish computes it last.
     if (digested)
         *out_digest = reinterpret_cast<wccp_wire_security_md5 *>(info)->digest;
     return commit_component(pkt, size);
@@ -77,6 +79,7 @@ int wccp_pkt_load_service_info_component(wccp_service_group *group, wccp_pkt *pk
         return 1;
     info->head = make_component_head(WCCP_SERVICE_INFO, sizeof *info);
     info->service_id = group->id;
+    // A standard service is defined by its id alone; routers expect its other fields to be zero.
     if (group->id > WCCP_LAST_STANDARD_ID) {
         info->service_type = 1;
         info->priority = group->priority;
@@ -87,6 +90,7 @@ int wccp_pkt_load_service_info_component(wccp_service_group *group, wccp_pkt *pk
 }
 
 int wccp_pkt_load_web_cache_identity_info_component(wccp_service_group *group, wccp_pkt *pkt) {
+    // Until a method has been agreed, the hash form is sent.
     if (group->assign_method == WCCP_ASSIGN_MASK) {
         auto *identity = find_room<wccp_wire_identity_mask>(pkt);
         if (!identity)
@@ -94,6 +98,7 @@ int wccp_pkt_load_web_cache_identity_info_component(wccp_service_group *group, w
         identity->head = make_component_head(WCCP_WEB_CACHE_IDENTITY_INFO, sizeof *identity);
         identity->web_cache_id = group->appliance_ipa;
         identity->flags = to_be16(WCCP_IDENTITY_MASK);
+        // One mask without values: the configured one, even where the assignment uses the default instead.
         identity->mask_elements = to_be32(1);
         identity->mask.mask = {to_be32(group->mask_src_ip), to_be32(group->mask_dst_ip),
                                to_be16(group->mask_src_port), to_be16(group->mask_dst_port)};
@@ -116,6 +121,7 @@ int wccp_pkt_load_web_cache_view_info_component(wccp_service_group *group, wccp_
     auto *view = find_room<wccp_wire_web_cache_view>(pkt, size);
     if (!view)
         return 1;
+    // A list longer than its count would be written past the room that was found.
     if (list_is_longer_than(group->sending_routers, group->sending_router_count)) {
         QV_LOG(LC_LOG_ERR, "WCCP router count (%d) mismatch with entries in router view list",
                static_cast<int>(group->sending_router_count));
@@ -152,9 +158,11 @@ uint8_t *write_router_elements(const wccp_service_group *group, void *elements) 
     uint32_t left = group->sending_router_count;
     for (wccp_sending_router *router = group->sending_routers; router && left;
          router = router->next, left--) {
+        // The receive id and the change number are echoed as received.
         *element++ = {router->router_id, router->receive_id, router->change_number};
         router->assign_tx_count++;
     }
+    // The count decides, not the list: a shorter list leaves elements of zeros.
     return reinterpret_cast<uint8_t *>(first + group->sending_router_count);
 }
 
@@ -181,6 +189,7 @@ int wccp_pkt_load_assignment_info_component(wccp_service_group *group, wccp_pkt 
                static_cast<int>(appliances));
         return 1;
     }
+    // The last part has a fixed size: one byte for each of the 256 buckets.
     const uint64_t size = sizeof(wccp_wire_assignment_info) +
                           uint64_t{routers} * sizeof(wccp_wire_assign_router_element) + sizeof(be32) +
                           appliances * sizeof(be32) + sizeof group->bucket_index;
@@ -193,6 +202,7 @@ int wccp_pkt_load_assignment_info_component(wccp_service_group *group, wccp_pkt 
     *address++ = to_be32(appliances);
     for (uint32_t i = 0; i < appliances; i++)
         *address++ = group->dsg_appliances[i].ipa;
+    // The buckets are indexes into the addresses above: dsg_appliances has the same order.
     memcpy(address, group->bucket_index, sizeof group->bucket_index);
     log_unassigned_slots(
         group, "WCCP GRP %d: TX HASH redirect assign: not all buckets are assigned. assigned: %d total: %d");
@@ -220,6 +230,7 @@ int wccp_pkt_load_mask_assignment_info_component(wccp_service_group *group, wccp
                group->id, static_cast<int>(size));
         return 1;
     }
+    // The inner length counts from the key address on.
     constexpr uint64_t outside = offsetof(wccp_wire_mask_assignment_info, key_address);
     *info = {.head = make_component_head(WCCP_MASK_ASSIGNMENT_INFO, size),
              .assignment_type = to_be16(1),
@@ -228,6 +239,7 @@ int wccp_pkt_load_mask_assignment_info_component(wccp_service_group *group, wccp
              .key_change = to_be32(group->dsg_key_change),
              .routers = to_be32(routers)};
     auto *elements = reinterpret_cast<be32 *>(write_router_elements(group, info + 1));
+    // A group has one mask; its values follow it.
     *elements++ = to_be32(1);
     auto *element = reinterpret_cast<wccp_wire_mask_element *>(elements);
     const wccp_mask *mask = &group->mask_in_use;
@@ -253,6 +265,7 @@ int wccp_pkt_load_capability_info_component(wccp_service_group *group, wccp_pkt 
         {WCCP_CAP_ASSIGNMENT, group->assign_method},
         {WCCP_CAP_RETURN, group->ret_method},
     };
+    // The protocol's defaults, GRE, hash and GRE, are not sent.
     constexpr uint32_t other_than_default = 2; // L2, mask, L2
     uint32_t count = 0;
     for (const auto &capability : capabilities)
@@ -286,6 +299,7 @@ int wccp_pkt_load_command_ext_component(wccp_service_group *group, wccp_pkt *pkt
 void wccp_pkt_digest(const wccp_service_group *group, const wccp_pkt *pkt, uint8_t digest[16]) {
     md5_state state;
     md5_init(&state);
+    // All 8 bytes of the password are hashed, its padding included.
     md5_append(&state, group->password, sizeof group->password);
     md5_append(&state, pkt->data, pkt->length);
     md5_finish(&state, digest);
@@ -293,6 +307,7 @@ void wccp_pkt_digest(const wccp_service_group *group, const wccp_pkt *pkt, uint8
 
 int wccp_pkt_finish(wccp_service_group *group, wccp_pkt *pkt, uint8_t *digest) {
     auto *header = reinterpret_cast<wccp_wire_msg_header *>(pkt->data);
+    // The header's length does not count the header itself. It is part of what is hashed, so it comes first.
     header->length = to_be16(static_cast<uint16_t>(pkt->length - sizeof *header));
     if (group->security_option == 1 && digest)
         wccp_pkt_digest(group, pkt, digest);

@@ -112,9 +112,11 @@ int read_i_see_you(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_ser
     const wccp_wire_router_identity *identity;
     if (const int status = wccp_pkt_unload_router_identity_info_component(group, pkt, &identity))
         return log_failed_step("unloading router identity", status);
+    // Kept in wire order: both are compared and echoed, never computed with.
     icu->router_id = identity->router_id;
     icu->receive_id = identity->receive_id;
     const uint32_t flags = to_host(service->flags);
+    // Also compared for standard services, for which routers send zeros.
     if (service->priority != group->priority || service->protocol != group->protocol ||
         flags != group->service_flags) {
         wccp_note_reason(group, WCCP_REASON_SERVICE_MISMATCH, icu->router_id,
@@ -128,13 +130,15 @@ int read_i_see_you(wccp_service_group *group, wccp_pkt *pkt, const wccp_wire_ser
             group->protocol, flags, group->service_flags);
         group->rx_service_mismatches++; // only counted: the router is accepted
     }
+    // The two fixed components have a fixed order; those that follow may come in any.
     if (const int status = wccp_pkt_unload_router_view_component(group, pkt, &icu->view))
         return log_failed_step("unloading router view", status);
+    // Ends because each component that is read moves the cursor by its head at least.
     for (uint32_t count = 0; pkt->offset < pkt->length;) {
         if (const int status = read_optional_component(group, pkt, icu))
             return status;
-        if (++count >
-            OPTIONAL_COMPONENTS) { // tested after the component has been read and could be refused itself
+        // Only now, when the component has been read and could be refused itself.
+        if (++count > OPTIONAL_COMPONENTS) {
             WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: ICU bogus packet  (too many optional components).",
                           group->id);
             note_malformed_message(group, pkt, wccp_reason_value("%u optional components", count),
@@ -151,6 +155,7 @@ wccp_sending_router *find_or_create_router(wccp_service_group *group, const icu_
                                            int *out_status) {
     *out_status = 0;
     if (wccp_sending_router *router = wccp_find_sending_router(group, icu->router_id)) {
+        // A known router is not negotiated with again; a change in what it offers is only noted.
         if (icu->has_capabilities)
             wccp_check_offered_methods(group, icu->router_id, &icu->offered);
         return router;
@@ -170,6 +175,7 @@ void check_acknowledgement(wccp_service_group *group, wccp_sending_router *route
                            const wccp_rtr_view_info *view) {
     if (!(router->flags & WCCP_RTR_ASSIGN_UNACKED))
         return;
+    // Another key is that of an earlier table, or of the appliance that was designated before.
     const uint32_t key_change = to_host(view->key_change);
     if (view->key_ipa == group->appliance_ipa && key_change == group->dsg_key_change &&
         router->assign_tx_count > 1) {
@@ -200,18 +206,21 @@ wccp_assign_summary apply_assignment_map(const wccp_service_group *group, wccp_s
     router->map_dst_ip = to_host(map->masks->mask.dst_ip);
     router->map_src_port = router->map_dst_port = 0;
     router->map_in_order = wccp_map_is_in_order(group, map);
+    // The map replaces what the elements of this message or an earlier map have left here.
     for (uint32_t i = 0; i < router->view_appliance_count; i++)
         memset(router->view_appliances[i].bucket_bits, 0, sizeof router->view_appliances[i].bucket_bits);
 
+    // A packet has room for 255 values at most.
     wccp_assign_summary summary = {
         .valid = 1, .self_count = 0, .total_count = static_cast<uint16_t>(map->value_count)};
     wccp_rtr_view_appliance *entry = nullptr;
     for (uint32_t i = 0; i < map->value_count; i++) {
         const be32 id = map->values[i].appliance_id;
+        // Counted even if the router does not list this appliance among its web-caches.
         if (id == group->appliance_ipa)
             summary.self_count++;
-        if (i == 0 ||
-            !(id == map->values[i - 1].appliance_id)) // values of one appliance are usually consecutive
+        // Values of one appliance are usually consecutive.
+        if (i == 0 || !(id == map->values[i - 1].appliance_id))
             entry = wccp_get_router_appliance_view_element(router, id);
         if (!entry) // the router does not list this appliance
             continue;
@@ -275,6 +284,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
         return status;
     int status;
     wccp_sending_router *router = find_or_create_router(group, &icu, &status);
+    // Not every refusal of a router counts as a failed I-See-You.
     if (!router)
         return status;
 
@@ -286,6 +296,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
     check_acknowledgement(group, router, &icu.view);
     if ((status = wccp_update_router_view(group, router, icu.view.router_count, icu.view.routers)) != 0)
         return status;
+    // Zeroed, because elements without assignment leave their counts untouched.
     wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES] = {};
     wccp_assign_summary hash = {}, mask = {};
     status = wccp_process_router_view_web_cache_id_elements(group, icu.view.appliance_count,
@@ -296,6 +307,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
         status = wccp_update_appliance_view(group, router, icu.view.appliance_count, decoded);
     if (status != 0)
         return status;
+    // Only now: the values are stored in the entries that the update above has written.
     if (icu.map.present) {
         if (!icu.map.masks || !icu.map.values) { // the decoder accepts a map of 0 mask elements
             note_malformed_message(group, pkt, wccp_reason_value("an assignment map without a mask"), {});
@@ -306,6 +318,7 @@ int wccp_pkt_process_i_see_you(wccp_service_group *group, wccp_pkt *pkt,
     }
     note_method_differences(group, router, decoded, icu.view.appliance_count, hash.mask_forms);
     note_missing_listing(group, router);
+    // Last, because the role follows from everything that the steps above have stored.
     status = wccp_update_appliance_redirect_status(group, router, &hash, &mask);
     if (status == 0) // complete: earlier refusals of this router no longer matter
         wccp_forget_refusals(group, router->router_id, pkt->ipa);
@@ -337,6 +350,7 @@ int refuse_packet(const wccp_pkt *pkt) {
 
 // `digest` points into the packet. It is zeroed, because the digest was computed with these bytes zero.
 bool verify_digest(const wccp_service_group *group, const wccp_pkt *pkt, uint8_t *digest) {
+    // The received digest has to be saved before its place in the packet is overwritten.
     uint8_t received[MD5_DIGEST_BYTES], computed[MD5_DIGEST_BYTES];
     memcpy(received, digest, sizeof received);
     memset(digest, 0, sizeof received);
@@ -375,12 +389,14 @@ bool check_security(wccp_service_group *group, const wccp_pkt *pkt, const wccp_w
 } // namespace
 
 int wccp_process_received_packet(wccp_pkt *pkt) {
+    // Reasons that are noted until the end of the processing get this source.
     const wccp_packet_source_scope source(pkt->ipa);
     const wccp_wire_msg_header *header;
     if (wccp_pkt_unload_msg_header(pkt, &header)) {
         log_failed_step("unloading msg header", 1);
         return refuse_packet(pkt);
     }
+    // Datagrams that were cut on receipt or padded by the sender are found here.
     const uint32_t claimed = to_host(header->length) + static_cast<uint32_t>(sizeof *header);
     if (claimed != pkt->length) {
         WCCP_COMPLAIN(
@@ -401,6 +417,7 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
         return 0;
     }
     const uint32_t type = to_host(header->type);
+    // The Here-I-Am messages of other appliances arrive as well if the group uses multicast.
     if (type != WCCP_I_SEE_YOU && type != WCCP_REMOVAL_QUERY) {
         QV_LOG(LC_LOG_INFO, "WCCP: message type (%u) is not for an appliance. sender ip: %s", type,
                addr_text(pkt->ipa).s);
@@ -429,6 +446,7 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
                          wccp_reason_value("group %d", service->service_id), {});
         return refuse_packet(pkt);
     }
+    // Not a failure: routers continue to send until they notice that the group is disabled.
     if (group->admin_state != WCCP_ADMIN_UP) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: is disabled. dropping the rxed packet.", group->id);
         wccp_note_reason(group, WCCP_REASON_GROUP_DISABLED, pkt->ipa, {}, {});
@@ -442,9 +460,11 @@ int wccp_process_received_packet(wccp_pkt *pkt) {
         return 0;
     }
     if (!check_security(group, pkt, security, digest)) {
+        // Counted for the group here and for the daemon in refuse_packet.
         group->rx_failures++;
         return refuse_packet(pkt);
     }
+    // Failures from here on have counters of their own and do not count as refused packets.
     if (type == WCCP_I_SEE_YOU) {
         group->rx_icus++;
         if (wccp_pkt_process_i_see_you(group, pkt, service))
@@ -545,6 +565,7 @@ int run_build_steps(const build_step (&steps)[Count], wccp_reason_code reason, w
             return log_failed_step(step.words, status);
         }
     }
+    // The message can be built again: the reason for an earlier failure no longer holds.
     wccp_forget_reason(group, reason, {});
     return 0;
 }

@@ -91,6 +91,7 @@ int clamp_to_int(uint64_t size) {
 // --- The beginning of every message
 
 int wccp_pkt_unload_msg_header(wccp_pkt *pkt, const wccp_wire_msg_header **out) {
+    // No group is known yet: the reason is kept with those of packets that belong to none.
     *out = peek_layout<wccp_wire_msg_header>(pkt);
     return *out ? skip_bytes(pkt, sizeof **out)
                 : refuse_message_size(nullptr, pkt, "a header", count_remaining_bytes(pkt), sizeof **out);
@@ -103,6 +104,7 @@ int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_secur
     const auto *info = peek_layout<wccp_wire_security_info>(pkt);
     if (!info)
         return refuse_message_size(nullptr, pkt, "a security info", count_remaining_bytes(pkt), sizeof *info);
+    // Every option other than 1 has the short form. The check of the group's security refuses unknown ones.
     const bool digested = to_host(info->option) == 1;
     const uint32_t size = digested ? sizeof(wccp_wire_security_md5) : sizeof(wccp_wire_security_info);
     if (to_host(info->head.type) != WCCP_SECURITY_INFO) {
@@ -112,6 +114,7 @@ int wccp_pkt_unload_security_info_component(wccp_pkt *pkt, const wccp_wire_secur
     if (to_host(info->head.length) > size - sizeof info->head) // a smaller length is accepted
         return refuse_message_size(nullptr, pkt, "a security info", to_host(info->head.length),
                                    size - sizeof info->head);
+    // The digest is not const: it is zeroed in place before the message is hashed.
     uint8_t *const digest = pkt->data + pkt->offset + offsetof(wccp_wire_security_md5, digest);
     if (skip_bytes(pkt, size))
         return refuse_message_size(nullptr, pkt, "a security info", count_remaining_bytes(pkt), size);
@@ -130,6 +133,7 @@ int wccp_pkt_unload_service_info_component(wccp_pkt *pkt, const wccp_wire_servic
                       to_host(info->head.type));
         return refuse_component_type(nullptr, pkt, to_host(info->head.type), WCCP_SERVICE_INFO);
     }
+    // The eight ports are always sent, used or not; therefore the length is fixed.
     if (to_host(info->head.length) != sizeof *info - sizeof info->head)
         return refuse_message_size(nullptr, pkt, "a service info", to_host(info->head.length),
                                    sizeof *info - sizeof info->head);
@@ -154,6 +158,7 @@ int wccp_pkt_unload_router_identity_info_component(wccp_service_group *group, wc
                       to_host(identity->head.type));
         return refuse_component_type(group, pkt, to_host(identity->head.type), WCCP_ROUTER_IDENTITY_INFO);
     }
+    // The received-from addresses are not used; their number matters only for the length.
     const uint64_t size = sizeof *identity + uint64_t{to_host(identity->received_from)} * sizeof(be32);
     if (size > count_remaining_bytes(pkt)) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: full length does not fit in pkt", group->id);
@@ -180,6 +185,7 @@ wccp_element_shape wccp_view_element_shape(uint16_t flags, uint32_t compat_mode)
     static constexpr wccp_element_shape ios = {WCCP_ELEMENT_REDIRECT,
                                                sizeof(wccp_wire_view_element_mask_short),
                                                offsetof(wccp_wire_view_element_mask_short, weight)};
+    // The compatibility mode matters only for elements with redirection; the other forms are common to both.
     if (!(flags & WCCP_IDENTITY_MASK))
         return hash;
     if (flags & WCCP_IDENTITY_NO_REDIRECT)
@@ -200,6 +206,7 @@ bool measure_router_view(const wccp_service_group *group, const wccp_pkt *pkt, u
         distance += wccp_view_element_shape(to_host(element->flags), group->compat_mode).size;
     }
     *out_size = distance;
+    // Only the heads have been read so far; the last element may still be cut off.
     return distance <= count_remaining_bytes(pkt);
 }
 
@@ -229,6 +236,7 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
         return refuse_message_size(group, pkt, "a router view", count_remaining_bytes(pkt),
                                    sizeof *view + routers * sizeof *addresses);
     }
+    // The extra word is the count of appliances, between the router addresses and the elements.
     const uint32_t elements_at = static_cast<uint32_t>(sizeof *view + (routers + 1) * sizeof(be32));
     // Without the count of appliances, measure_router_view below refuses the view, because the count is
     // included in `elements_at`.
@@ -240,6 +248,7 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
         return refuse_message(group, pkt, wccp_reason_value("%u appliances", appliances),
                               wccp_reason_value("%u at most", WCCP_MAX_APPLIANCES));
     }
+    // Elements differ in size, and only a walk over all of them gives the size of the view.
     uint64_t size;
     if (!measure_router_view(group, pkt, elements_at, appliances, &size)) {
         WCCP_COMPLAIN(LC_LOG_ERR,
@@ -250,6 +259,7 @@ int wccp_pkt_unload_router_view_component(wccp_service_group *group, wccp_pkt *p
             wccp_reason_value("%u bytes for %u appliances", count_remaining_bytes(pkt), appliances), {},
             WCCP_REASON_VIEW_LENGTH);
     }
+    // The elements of a router in the other compatibility mode have another size; this is where it shows.
     if (to_host(view->head.length) != size - sizeof view->head) {
         WCCP_COMPLAIN(
             LC_LOG_ERR,
@@ -288,6 +298,7 @@ uint16_t decode_bucket_bits(const wccp_wire_view_element_hash *element, wccp_rtr
         bits = (bits & 0x3333333333333333) + ((bits >> 2) & 0x3333333333333333);
         in_bytes += (bits + (bits >> 4)) & 0x0f0f0f0f0f0f0f0f;
     }
+    // A sum of 256 does not fit in a byte; therefore the bytes are widened to 16 bits before the addition.
     const uint64_t in_pairs = (in_bytes & 0x00ff00ff00ff00ff) + ((in_bytes >> 8) & 0x00ff00ff00ff00ff);
     decoded->buckets_assigned = static_cast<uint16_t>((in_pairs * 0x0001000100010001) >> 48);
     decoded->buckets_total = WCCP_MAX_BUCKETS;
@@ -325,8 +336,8 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
         decoded->weight = to_host(*weight);
         hash_summary->mask_forms |= by_hash ? 0 : 1u << i;
         if (shape.form == WCCP_ELEMENT_REDIRECT) {
-            hash_summary->valid = 0; // the assignment is in an Assignment Map
-        } else if (by_hash && flags & WCCP_IDENTITY_HISTORICAL) {
+            hash_summary->valid = 0;                              // the assignment is in an Assignment Map
+        } else if (by_hash && flags & WCCP_IDENTITY_HISTORICAL) { // not the assignment in force
             QV_LOG(LC_LOG_INFO, "WCCP GRP %d: app id. %s assignment is historical, ignored", group->id,
                    addr_text(decoded->ipa).s);
         } else if (by_hash) {
@@ -337,6 +348,7 @@ int wccp_process_router_view_web_cache_id_elements(wccp_service_group *group, ui
         }
         distance += shape.size;
     }
+    // The elements of a faulty router may overlap and add up to more buckets than there are.
     hash_summary->total_count = static_cast<uint16_t>(total < WCCP_MAX_BUCKETS ? total : WCCP_MAX_BUCKETS);
     return 0;
 }
@@ -349,6 +361,7 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
         sizeof(wccp_wire_assignment_map) + sizeof(wccp_wire_mask_element) + sizeof(wccp_wire_value_element);
     constexpr uint32_t head = sizeof(wccp_wire_component);
     const auto *map = peek_layout<wccp_wire_assignment_map>(pkt);
+    // A map must have room for one mask and one value even if it announces no mask elements.
     if (!map || count_remaining_bytes(pkt) < smallest) {
         WCCP_COMPLAIN(
             LC_LOG_ERR,
@@ -370,8 +383,10 @@ int wccp_pkt_unload_assignment_map_component(wccp_service_group *group, wccp_pkt
     out->element_count = to_host(map->mask_elements);
     out->masks = peek_layout<wccp_wire_mask_element>(pkt, sizeof *map);
     uint64_t size = sizeof *map; // including the component's head, which `declared` does not count
+    // The declared length only limits this walk; the sizes of the elements decide where the component ends.
     for (uint32_t i = 0; i < out->element_count; i++) {
         const auto *element = peek_layout<wccp_wire_mask_element>(pkt, size);
+        // An element that was not received counts no values and is refused by the test below.
         const uint64_t values_at = size + sizeof *element;
         const uint64_t values = element ? to_host(element->values) : 0;
         size = values_at + values * sizeof(wccp_wire_value_element);
@@ -427,6 +442,7 @@ int wccp_pkt_unload_capability_info_component(wccp_service_group *group, wccp_pk
         for (const capability &each : known)
             if (each.type == to_host(element->type))
                 found = &each;
+        // The element's own length is not read: all known capabilities have four bytes.
         if (found) // a repeated capability replaces the earlier one
             out->*found->word = to_host(element->value);
         else
@@ -443,6 +459,7 @@ int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *p
         return refuse_message_size(group, pkt, "a command", count_remaining_bytes(pkt), sizeof *extension);
     }
     const uint32_t length = to_host(extension->head.length);
+    // The fields are at fixed places. Only the cursor follows the declared length, even a shorter one.
     if (skip_bytes(pkt, sizeof extension->head + length)) {
         WCCP_COMPLAIN(LC_LOG_ERR, "WCCP GRP %d: bogus component length (%d): does not  fit in the packet.",
                       group->id, clamp_to_int(length));
@@ -456,6 +473,7 @@ int wccp_pkt_unload_command_ext_component(wccp_service_group *group, wccp_pkt *p
 
 uint16_t wccp_pkt_next_component_type(const wccp_pkt *pkt) {
     const auto *type = peek_layout<be16>(pkt);
+    // 0 also stands for fewer bytes than a type. No optional component has it; they are refused as unknown.
     return type ? to_host(*type) : 0;
 }
 

@@ -68,6 +68,7 @@ int wccp_get_grp_info(int id, wccp_grp_info *info) {
     info->num_view_routers = group->router_view_count;
     info->since = wccp_g.seconds - group->start_time;
     info->pending_acks = group->pending_acks;
+    // In INIT, state_time still has the time of an earlier state.
     const bool timed = (group->state_flags & (WCCP_STATE_ACTIVE | WCCP_STATE_BACKUP)) != 0;
     info->uptime = timed ? wccp_g.seconds - group->state_time : 0;
     copy_text(info->oper, state_words[group->state_flags & WCCP_STATE_MASK]);
@@ -87,12 +88,14 @@ int wccp_get_grp_router_info(int id, wccp_grp_router_info *info) {
         return 1;
     const wccp_sending_router *router = find_nth_or_log(group->sending_routers, info->router_num,
                                                         "WCCP GRP %d: Router number %d not present", id);
+    // A router that has left since its number was listed is not a failure; the fields stay empty.
     if (!router)
         return 0;
     info->router_id = router->router_id;
     info->src_ipa = router->src_ipa;
     info->conn_time = wccp_g.seconds - router->state_time;
     info->heard = wccp_g.seconds - router->last_icu_time;
+    // The methods are the group's: all routers use those that the first one has agreed on.
     const bool agreed = (group->state_flags & WCCP_CAPABILITIES_SET) != 0;
     copy_text(info->fwd, agreed ? find_word(method_words, group->fwd_method) : "not-set");
     copy_text(info->ret, agreed ? find_word(method_words, group->ret_method) : "not-set");
@@ -108,6 +111,7 @@ int wccp_get_grp_appliance_info(int id, wccp_grp_appliance_info *info) {
         return 1;
     const wccp_engine_lock lock;
     const wccp_service_group *group = wccp_find_group(id);
+    // Likewise, a group or an appliance that has left is not a failure.
     if (!group)
         return 0;
     const wccp_view_appliance *appliance = find_nth_or_log(
@@ -136,6 +140,7 @@ int wccp_get_router_list(wccp_router_list *list) {
     const wccp_service_group *group = find_group_or_log(static_cast<int>(list->group_id));
     if (!group)
         return 1;
+    // Numbers are places in the list, counted from 1.
     list->count = 0;
     for (const wccp_sending_router *router = group->sending_routers; router && list->count < WCCP_MAX_ROUTERS;
          router = router->next) {
@@ -171,6 +176,7 @@ int wccp_get_router_appliance_info(wccp_router_appliance_info *info) {
         const wccp_rtr_view_appliance *appliance = &router->view_appliances[i];
         if (appliance->ipa != info->ipa)
             continue;
+        // The total is 0 where neither bits nor values have been read.
         info->load_percent =
             appliance->buckets_total ? appliance->buckets_assigned * 100u / appliance->buckets_total : 0;
         return 0;
@@ -202,6 +208,7 @@ int wccp_get_reason_list(int id, wccp_reason_list *list) {
     if (!table)
         return 1;
     list->count = 0;
+    // Places are counted from 1, like the numbers of routers.
     for (uint32_t i = 0; i < places; i++)
         if (wccp_reason_holds(&table[i]))
             list->places[list->count++] = static_cast<uint8_t>(i + 1);
@@ -217,6 +224,7 @@ int wccp_get_reason(int id, uint32_t place, wccp_reason_info *info) {
     if (!table)
         return 1;
     *info = {};
+    // A reason that has ended since it was listed is not a failure: the answer then has the code NONE.
     if (place < 1 || place > places || !wccp_reason_holds(&table[place - 1]))
         return 0;
     info->reason = table[place - 1];

@@ -75,6 +75,7 @@ static_assert(sizeof code_rows / sizeof *code_rows == WCCP_REASON_CODES);
 bool group_has_router(const wccp_service_group *group, be32 address) {
     if (!group)
         return false;
+    // A sender can be a configured address, a router's id, or the address that its packets come from.
     for (uint32_t i = 0; i < group->ucast_router_count; i++)
         if (group->ucast_routers[i] == address)
             return true;
@@ -125,6 +126,7 @@ const char *wccp_reason_word(uint32_t code) {
 
 bool wccp_reason_holds(const wccp_reason *reason) {
     const code_row *row = &code_rows[reason->code];
+    // A reason is not removed when its time is up; it only no longer counts.
     const bool by_time = row->ends == ending::acceptance_or_time || row->ends == ending::time;
     return reason->code != WCCP_REASON_NONE && (!by_time || wccp_g.seconds - reason->last <= REPEATED_WITHIN);
 }
@@ -147,6 +149,7 @@ bool wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sen
                       const wccp_reason_text &offered, const wccp_reason_text &wanted) {
     wccp_reason *reason = find_reason(group, code, sender);
     const bool is_new = !reason || !wccp_reason_holds(reason);
+    // A reason that has expired starts again; its count and first time belong to the earlier occurrence.
     if (is_new) {
         if (!reason)
             reason = find_place_for_reason(group);
@@ -154,10 +157,12 @@ bool wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sen
         reason->code = code;
         reason->sender = sender;
         reason->first = wccp_g.seconds;
+        // Strangers are replaced first, so that their packets cannot displace reasons about own routers.
         reason->stranger = !is_zero(sender) && !group_has_router(group, sender);
     }
     reason->count++;
     reason->last = wccp_g.seconds;
+    // The sender may be an id from the packet; the source is where the packet came from.
     reason->source = packet_source;
     reason->offered = offered;
     reason->wanted = wanted;
@@ -165,6 +170,7 @@ bool wccp_note_reason(wccp_service_group *group, wccp_reason_code code, be32 sen
 }
 
 void wccp_forget_reason(wccp_service_group *group, wccp_reason_code code, be32 sender) {
+    // An entry without a code is free.
     if (wccp_reason *reason = find_reason(group, code, sender))
         reason->code = WCCP_REASON_NONE;
 }
@@ -187,6 +193,7 @@ void wccp_forget_all_reasons(wccp_service_group *group) {
 }
 
 void wccp_forget_refusals(wccp_service_group *group, be32 router_id, be32 source) {
+    // What was noted in this second is about the accepted message itself.
     for (wccp_reason &each : group->reasons)
         if ((code_rows[each.code].ends == ending::acceptance_or_time ||
              code_rows[each.code].ends == ending::acceptance) &&

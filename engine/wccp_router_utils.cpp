@@ -128,6 +128,7 @@ int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,
     // Once the first router has decided, the configuration no longer matters.
     const capabilities *local = group->state_flags & WCCP_CAPABILITIES_SET ? &in_force : &configured;
     capabilities agreed = {};
+    // The order matters: which assignment is preferred depends on the forwarding agreed before.
     for (const capability_step &step : capability_steps) {
         agreed.*step.word =
             choose_common_method(local->*step.word, offered->*step.word, step.preferred(&agreed));
@@ -147,6 +148,7 @@ int wccp_process_router_capabilities(wccp_service_group *group, be32 router_id,
 void wccp_check_offered_methods(wccp_service_group *group, be32 router_id,
                                 const wccp_rtr_capabilities *offered) {
     const capabilities in_force = {group->fwd_method, group->assign_method, group->ret_method};
+    // Only noted: a router that has a record keeps it, whatever it offers later.
     for (const capability_step &step : capability_steps)
         if (in_force.*step.word != WCCP_METHOD_NONE && (in_force.*step.word & offered->*step.word) == 0)
             wccp_note_reason(group, step.reason, router_id,
@@ -178,6 +180,7 @@ wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 
         return nullptr;
     }
     uint32_t flags = WCCP_RTR_ONE_WAY;
+    // Packets that are returned in GRE need a tunnel even if they arrive by L2.
     if (agreed->forwarding == WCCP_METHOD_GRE || agreed->ret == WCCP_METHOD_GRE) {
         if (wccp_add_tunnel(group->id, group->appliance_ipa, router_id))
             return nullptr; // the router's next I-See-You tries again
@@ -187,6 +190,7 @@ wccp_sending_router *wccp_create_sending_router(wccp_service_group *group, be32 
     router->router_id = router_id;
     router->flags = flags;
     router->state_time = wccp_g.seconds;
+    // Kept for the dumps; decisions use the agreed methods of the group.
     router->cap_fwd = static_cast<uint8_t>(offered->forwarding & 0xff);
     router->cap_assign = static_cast<uint8_t>(offered->assignment & 0xff);
     router->cap_ret = static_cast<uint8_t>(offered->ret & 0xff);
@@ -224,6 +228,7 @@ void remove_silent_router(wccp_service_group *group, wccp_sending_router *router
     list_unlink(router); // so that the functions below do not find it; sending_router_count still counts it
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: removing router (router id: %s) due to inactivity.", group->id,
            addr_text(router->router_id).s);
+    // Before the record is freed: its arrays are the only list of the references that it holds.
     drop_view_references(group, router);
     if (router->flags & WCCP_RTR_HAS_TUNNEL)
         wccp_del_tunnel(group->id, group->appliance_ipa, router->router_id, 0);
@@ -241,6 +246,7 @@ void remove_silent_router(wccp_service_group *group, wccp_sending_router *router
         if (group->redirecting_routers == 0)
             wccp_appliance_state_init(group);
     }
+    // Even if no reference was the last one, a router that has left is a change of the view.
     group->change_number++;
     group->state_flags |= WCCP_DESG_ELECT_PENDING;
     group->sending_router_count--;
@@ -314,6 +320,7 @@ int wccp_process_router_removal_query(wccp_service_group *group, be32 router_id,
                          {});
         return 1;
     }
+    // The record is zeroed, as the encoders expect.
     wccp_pkt *pkt = &reply.pointer->pkt;
     pkt->cursor = pkt->data;
     pkt->ipa = router_id; // only the querying router gets the reply
@@ -335,6 +342,7 @@ int wccp_send_router_removal_query_reply(wccp_service_group *group) {
         next = reply->next;
         if (wccp_transmit_packet(group, &reply->pkt, WCCP_REMOVAL_REPLY))
             QV_LOG(LC_LOG_ERR, "WCCP GRP %u: %s failed.", group->id, "sending Query Response HERE_I_AM ");
+        // The reply is sent three times, since the network may lose it.
         if (--reply->tx_left == 0) { // failed transmissions count as well
             list_unlink(reply);
             group->removal_reply_count--;

@@ -15,6 +15,7 @@ void wccp_count_slots_by_owner(wccp_service_group *group, uint8_t *out_index) {
         const be32 address = group->bucket_ipa[slot];
         if (slot == 0 || !(address == group->bucket_ipa[slot - 1])) // an appliance's slots are consecutive
             owner = wccp_find_dsg_appliance(group, group->dsg_active_count, address);
+        // A slot of an earlier table, whose appliance has left.
         if (!owner)
             continue;
         owner->assigned++;

@@ -63,6 +63,7 @@ void set_only_state(wccp_service_group *group, uint32_t state) {
 } // namespace
 
 int wccp_appliance_state_init(wccp_service_group *group) {
+    // Unlike the other states, INIT is not entered again: removing the last router may ask for it twice.
     if (group->state_flags & WCCP_STATE_INIT)
         return 0;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: appliance state : INIT", group->id);
@@ -178,6 +179,7 @@ int wccp_update_designated_redirect_assignment(wccp_service_group *group, int re
         return 1;
     }
     group->dsg_key_change++; // the routers report it when they have the new table
+    // At most 32, so that the 8 bits suffice.
     group->pending_acks = static_cast<uint8_t>(group->sending_router_count & 0xff);
     for (wccp_sending_router *router = group->sending_routers; router; router = router->next) {
         router->flags |= WCCP_RTR_ASSIGN_UNACKED;
@@ -234,7 +236,9 @@ int wccp_elect_designated_appliance(wccp_service_group *group) {
     group->designated = 0; // until this election has selected this appliance again
     wccp_forget_reasons(group, WCCP_REASON_APPLIANCE_LEFT_OUT);
     wccp_clear_redirect_assign_states(group);
+    // Postponed: the routers need time to adopt a new table.
     wccp_alarm_schedule_verify_allocation_table_timer(group, 1);
+    // No timer repeats an election: the next change of a view requests another one.
     if (group->appliance_view_count == 0) {
         QV_LOG(LC_LOG_INFO, "WCCP GRP %d: DSG event: appliance view is empty. try later.", group->id);
         return 0;
@@ -281,6 +285,7 @@ const tick_step tick_steps[] = {
      [](wccp_service_group *group) {
          return wccp_transmit_packet(group, group->tx_pkt, WCCP_REDIRECT_ASSIGN);
      }},
+    // A router that this step removes requests an election, which is held in the next tick.
     {&wccp_service_group::monitor_timer, nullptr, "monitor sending routers", wccp_monitor_sending_routers},
     {&wccp_service_group::router_alarm_timer, nullptr, "alarm verify routers",
      wccp_alarm_verify_router_connectivity},
@@ -291,6 +296,7 @@ const tick_step tick_steps[] = {
 bool count_down_timer(wccp_timer *timer) {
     if (timer->active != 1)
         return false;
+    // A countdown of 0 expires like one of 1: in this tick.
     if (timer->countdown > 1) {
         timer->countdown--;
         return false;
@@ -309,6 +315,7 @@ bool count_down_timer(wccp_timer *timer) {
 
 int wccp_process_timers(wccp_service_group *group) {
     for (const tick_step &step : tick_steps) {
+        // Timers count down as their turn comes: one that an earlier step has set counts this tick already.
         const bool due = step.timer ? count_down_timer(&(group->*step.timer)) : step.pending(group);
         if (due && step.action(group) && step.words)
             QV_LOG(LC_LOG_ERR, "WCCP GRP %u: %s failed.", group->id, step.words);

@@ -130,6 +130,7 @@ int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
         return 1;
     }
     wccp_reason_code failure = WCCP_REASON_NONE;
+    // Waits for tunneld, two seconds at most, without the tunnel mutex.
     if (wccp_add_tunnel_or_say_why(id.id, to_mailbox_address(local), to_mailbox_address(remote),
                                    &tunnel.pointer->dataplane_index, &failure) == 1) {
         note_tunnel_failure(group, failure, remote, wccp_reason_value("tunnel id %d", id.id),
@@ -145,6 +146,7 @@ int wccp_add_tunnel(uint32_t group_id, be32 local, be32 remote) {
     {
         const mutex_guard guard(&tunnel_mutex);
         list_push_head(&tunnel_list, tunnel.take());
+        // The record has the id now; from here on a delete gives it back.
         id.taken = false;
     }
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: created GRE tunnel id %d %s <=> %s", group, id.id, addr_text(local).s,
@@ -162,6 +164,7 @@ int wccp_del_tunnel(uint32_t group_id, be32 local, be32 remote, int force) {
         return 0;
     if (!force && tunnel->ref_count.fetch_sub(1) > 1) // others still use it
         return 0;
+    // The record is removed even if tunneld does not answer: otherwise its id would be lost.
     const tunnel_removal removal(tunnel); // after the log lines, which still use the record
     const int result = wccp_del_tunnel_encap(tunnel->tunnel_id, to_mailbox_address(local),
                                              to_mailbox_address(remote), &tunnel->dataplane_index);
@@ -196,6 +199,7 @@ int wccp_del_all_tunnels() {
 int wccp_restore_all_tunnels() {
     QV_LOG(LC_LOG_INFO, "WCCP: Restore all gre tunnels");
     const mutex_guard guard(&tunnel_mutex);
+    // With the mutex held throughout, which keeps the list in place for all the waits.
     for (wccp_tunnel *tunnel = tunnel_list; tunnel; tunnel = tunnel->next)
         if (wccp_add_tunnel_encap(tunnel->tunnel_id, to_mailbox_address(tunnel->local_ipa),
                                   to_mailbox_address(tunnel->remote_ipa), &tunnel->dataplane_index) == 1)

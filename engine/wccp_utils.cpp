@@ -37,6 +37,7 @@ wccp_addr_text addr_text(be32 address) {
 }
 
 void wccp_clear_assignment_block(wccp_service_group *group) {
+    // The first and the last field of the block, as marked in the record.
     constexpr size_t begin = offsetof(wccp_service_group, dsg_appliance_count);
     constexpr size_t end = offsetof(wccp_service_group, pending_acks) + sizeof(group->pending_acks);
     memset(reinterpret_cast<uint8_t *>(group) + begin, 0, end - begin);
@@ -81,6 +82,7 @@ void *counted_calloc(const char *failure, uint32_t count, uint32_t size) {
         return memory;
     }
     wccp_g.stat_alloc_fails.fetch_add(1, std::memory_order_relaxed);
+    // An overflow does no harm here: calloc checks for it, and this product is only printed.
     QV_LOG(LC_LOG_ERR, failure, static_cast<int>(count * size));
     return nullptr;
 }
@@ -106,6 +108,7 @@ void wccp_seconds_to_str(uint32_t seconds, char *buffer, uint32_t length) {
     length &= 0xff;
     if (!buffer || length < 32)
         return;
+    // Days, hours, minutes and seconds.
     snprintf(buffer, length, "%u:%u:%u:%u", seconds / 86400, seconds / 3600 % 24, seconds / 60 % 60,
              seconds % 60);
 }

@@ -52,6 +52,7 @@ int wccp_view_list_add_appliance_sorted(wccp_service_group *group, wccp_view_app
         list_push_head(&group->appliance_view, entry);
         return 0;
     }
+    // Only the head's position is maintained: readers go through the whole list or sort for themselves.
     const bool above = entry->weight != head->weight ? entry->weight > head->weight
                                                      : to_host(entry->ipa) > to_host(head->ipa);
     if (above) {
@@ -205,6 +206,7 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
     bool changed = false;
     int status = 0;
     clear_marks(router->view_routers, old_count);
+    // New addresses take a reference, known ones are marked.
     for (uint32_t i = 0; i < count; i++) {
         if (!(taken >> i & 1))
             continue;
@@ -218,6 +220,7 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
             status = 1;
         }
     }
+    // Old addresses without a mark are missing from the report: their references are dropped.
     for (uint32_t i = 0; i < old_count; i++) {
         if (router->view_routers[i].flags & MARK)
             continue;
@@ -226,6 +229,7 @@ int wccp_update_router_view(wccp_service_group *group, wccp_sending_router *rout
     }
     // Only now may the old entries be overwritten.
     router->view_router_count = 0;
+    // Marks stay with their places in the array; each comparison clears them first.
     for (uint32_t i = 0; i < count; i++)
         if (taken >> i & 1)
             router->view_routers[router->view_router_count++].ipa = addresses[i];
@@ -257,6 +261,7 @@ int apply_reported_weight(wccp_service_group *group, const wccp_rtr_view_applian
     entry->weight = element->weight;
     if (wccp_view_list_add_appliance_sorted(group, entry))
         return 1;
+    // The designated appliance sees the change in the reports that it receives itself.
     if (group->designated != 1)
         return 0;
     // A change of weight needs no election, only a new table.
@@ -280,9 +285,10 @@ bool add_appliance_reference(wccp_service_group *group, const wccp_rtr_view_appl
         entry->ipa = element->ipa;
         entry->weight = element->weight;
         group->appliance_view_count++;
-        (void)wccp_view_list_add_appliance_sorted(group,
-                                                  entry); // fails only for an address that is in the list
+        // This fails only for an address that is in the list.
+        (void)wccp_view_list_add_appliance_sorted(group, entry);
     }
+    // A known entry keeps its weight, even if this router reports another one.
     entry->ref_count++;
     return true;
 }
@@ -292,6 +298,7 @@ void set_two_way(wccp_service_group *group, wccp_sending_router *router) {
     router->state_time = wccp_g.seconds;
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: router id %s is TWO-WAY connected.", group->id,
            addr_text(router->router_id).s);
+    // The alarm is cleared by the check: the other routers must be two-way as well.
     wccp_alarm_schedule_verify_router_connectivity_timer(group, 0);
 }
 
@@ -342,6 +349,7 @@ int apply_appliance_report(wccp_service_group *group, wccp_sending_router *route
     int status = 0;
     *out_taken = find_first_occurrences(decoded, count);
     clear_marks(old, old_count);
+    // First what the report has: new appliances take a reference, known ones are marked.
     for (uint32_t i = 0; i < count; i++) {
         const wccp_rtr_view_appliance *element = &decoded[i];
         if (!(*out_taken >> i & 1))
@@ -358,9 +366,11 @@ int apply_appliance_report(wccp_service_group *group, wccp_sending_router *route
             continue;
         }
         *out_changed = true;
+        // The router lists this appliance, therefore it receives our Here-I-Am.
         if (element->ipa == group->appliance_ipa)
             set_two_way(group, router);
     }
+    // Then what it no longer has: entries without a mark drop their reference.
     for (uint32_t i = 0; i < old_count; i++) {
         if (old[i].flags & MARK)
             continue;
@@ -378,6 +388,7 @@ int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *r
                                const wccp_rtr_view_appliance *decoded) {
     if (count > WCCP_MAX_APPLIANCES)
         return 1;
+    // A report that repeats the last one has no duplicates: they were removed when that one was stored.
     uint32_t taken = ~0u;
     bool changed = false;
     int status = 0;
@@ -385,6 +396,7 @@ int wccp_update_appliance_view(wccp_service_group *group, wccp_sending_router *r
         set_marks(router->view_appliances, count);
     else
         status = apply_appliance_report(group, router, count, decoded, &taken, &changed);
+    // Stored even if it repeats the last one: what is assigned may differ.
     store_appliance_report(router, count, decoded, taken);
     if (changed)
         note_view_change(group, router,
@@ -424,6 +436,7 @@ void handle_redirect_here(wccp_service_group *group, const wccp_sending_router *
 }
 
 void handle_redirect_elsewhere(wccp_service_group *group, const wccp_sending_router *router) {
+    // In ACTIVE, other routers still redirect here, and the group stays in it.
     if (group->state_flags & WCCP_STATE_INIT)
         enter_state(group, router,
                     "WCCP GRP %d: redirect: router id %s is redirecting to other  appliance(s).",
@@ -452,6 +465,7 @@ void handle_end_of_redirect_here(wccp_service_group *group, const wccp_sending_r
 }
 
 void handle_end_of_redirect_elsewhere(wccp_service_group *group, const wccp_sending_router *router) {
+    // The router itself does not count: it has just stopped.
     if (group->state_flags & WCCP_STATE_BACKUP &&
         !wccp_any_routers_redirecting_to_other_appliances(group, router))
         enter_state(group, router, "WCCP GRP %d: redirect: no routers redirecting to group (router id %s)",
@@ -463,6 +477,7 @@ void handle_end_of_redirect_elsewhere(wccp_service_group *group, const wccp_send
 void apply_redirect_change(wccp_service_group *group, const wccp_sending_router *router, uint16_t self_before,
                            uint16_t total_before) {
     const bool here = router->self_buckets != 0, anywhere = router->total_buckets != 0;
+    // A router may redirect both here and elsewhere. In that case only the part for this appliance matters.
     if (here) {
         if (self_before == 0)
             handle_redirect_here(group, router);
@@ -479,6 +494,7 @@ void apply_redirect_change(wccp_service_group *group, const wccp_sending_router 
 
 int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sending_router *router,
                                           const wccp_assign_summary *hash, const wccp_assign_summary *mask) {
+    // A valid mask summary is from an Assignment Map, which overrides what the elements say.
     const wccp_assign_summary *now = mask->valid == 1 ? mask : hash;
     if (now->valid != 1) { // elements of mask assignment, but no Assignment Map
         WCCP_COMPLAIN(LC_LOG_WARNING,
@@ -488,6 +504,7 @@ int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sendin
         return 1;
     }
     const uint32_t method = now == mask ? WCCP_ASSIGN_MASK : WCCP_ASSIGN_HASH;
+    // A router that assigns nothing uses no method.
     if (now->total_count != 0 && method != group->assign_method)
         wccp_note_reason(group, WCCP_REASON_METHOD_DIFFERS, router->router_id,
                          wccp_reason_value("%s by the router", wccp_assign_method_name(method)),
@@ -495,6 +512,7 @@ int wccp_update_appliance_redirect_status(wccp_service_group *group, wccp_sendin
     QV_LOG(LC_LOG_INFO, "WCCP GRP %d: RX redirect status: rtr id: %s to self: %d/%d buckets (%s)", group->id,
            addr_text(router->router_id).s, now->self_count, now->total_count,
            now == mask ? "mask assign" : "hash assign");
+    // In steady state nothing has changed, and the role is left alone.
     const uint16_t self_before = router->self_buckets, total_before = router->total_buckets;
     if (now->self_count == self_before && now->total_count == total_before)
         return 0;

@@ -59,6 +59,7 @@ unanswered_command unanswered; // mailbox_mutex
 
 // mailbox_mutex held.
 void reset_mailbox(wccp_tunnel_mailbox *mailbox, uint32_t index) {
+    // First, so that tunneld does not take the values below for a command.
     mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
     mailbox_put(mailbox->tunnel_id, uint16_t{0});
     mailbox_put(mailbox->status, 0u);
@@ -154,6 +155,7 @@ effort choose_effort(uint16_t code, const wccp_tunnel_mailbox *mailbox) {
 }
 
 void write_command(wccp_tunnel_mailbox *mailbox, uint16_t code, const mailbox_inputs *inputs) {
+    // A command that timed out may still be in the slot, and tunneld may be reading its inputs.
     mailbox->command.store(MAILBOX_IDLE, std::memory_order_release);
     if (code == MAILBOX_L2_RETURN) {
         mailbox_put(mailbox->l2_group, inputs->l2_group);
@@ -173,7 +175,7 @@ enum class wait_end { ANSWERED, TIMED_OUT, ABANDONED };
 wait_end wait_for_answer(wccp_tunnel_mailbox *mailbox, uint16_t code) {
     wait_end end = wait_end::TIMED_OUT;
     for (int i = 0; i < ANSWER_POLLS && end == wait_end::TIMED_OUT; i++) {
-        poll(nullptr, 0, 1);
+        poll(nullptr, 0, 1); // sleeps for a millisecond
         if (mailbox->command.load(std::memory_order_acquire) == MAILBOX_IDLE)
             return wait_end::ANSWERED;
         if (abandon.load(std::memory_order_acquire))
@@ -216,6 +218,7 @@ bool run_command(const command_kind *kind, const mailbox_inputs *inputs, uint32_
 mailbox_inputs make_tunnel_inputs(uint16_t tunnel_id, mailbox_address local, mailbox_address remote,
                                   uint32_t index) {
     return {.tunnel_id = tunnel_id,
+            // An IPv4 address is in the low 32 bits of the 16 bytes.
             .local_ip = static_cast<uint32_t>(local.words[0]),
             .remote_ip = static_cast<uint32_t>(remote.words[0]),
             .fmst_index = index,
@@ -239,6 +242,7 @@ int wccp_add_tunnel_or_say_why(uint16_t tunnel_id, mailbox_address local, mailbo
         return 1;
     *out_failure = WCCP_REASON_TUNNEL_REFUSED; // the only failure that an answer can report
     *inout_index = index;
+    // An answer without an index is a failure, whatever its status.
     return index == WCCP_NO_INDEX ? 1 : static_cast<int>(status);
 }
 

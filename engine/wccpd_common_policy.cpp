@@ -86,6 +86,7 @@ void remove_member(uint16_t policy, uint8_t id) {
     for (const uint8_t byte : set->bits)
         if (byte)
             return;
+    // The last member has left; sets without members are not kept.
     remove_member_set(set);
 }
 
@@ -104,6 +105,7 @@ void update_policy_role(uint16_t policy) {
                                         "WCCP: Update policy group %d role to BACKUP",
                                         "WCCP: Update policy group %d role to UNKNOWN"};
     const uint32_t role = derive_policy_role(find_member_set(policy));
+    // With the mutex held: two changes must not publish their roles in the wrong order.
     if (wccp_publish_policy_role(policy, role))
         QV_LOG(LC_LOG_DEBUG, lines[role], policy);
 }
@@ -135,6 +137,7 @@ int wccp_add_policy_grp(uint16_t policy, uint32_t count, const uint8_t *ids) {
         svc_policy_grp[id] = policy; // the bit in an earlier policy group stays
         QV_LOG(LC_LOG_DEBUG, "WCCP: Add Service group %d to Policy group %d", id, policy);
     }
+    // Without ids this only publishes the role, UNKNOWN for a policy group that has no members yet.
     update_policy_role(policy);
     return result;
 }
@@ -142,6 +145,7 @@ int wccp_add_policy_grp(uint16_t policy, uint32_t count, const uint8_t *ids) {
 int wccp_remove_policy_grp(uint16_t policy, uint8_t id) {
     const mutex_guard guard(&policy_mutex);
     remove_member(policy, id);
+    // Even if the group has joined another one since; therefore callers remove it before they add it.
     svc_policy_grp[id] = 0;
     QV_LOG(LC_LOG_DEBUG, "WCCP GRP %d: Remove Service group from Policy group %d", id, policy);
     update_policy_role(policy);

@@ -82,6 +82,7 @@ lc_status ensure_dir_of_file(const char *path, mode_t mode) {
     char name[PATH_MAX];
     if (strlcpy(name, path, sizeof name) >= sizeof name)
         return refuse_with(LC_BAD_PATH, ENAMETOOLONG);
+    // O_PATH needs no permission to read the directory.
     owned_fd dir(open(name[0] == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
     char *part = name;
     for (;;) {
@@ -122,6 +123,7 @@ lc_status write_and_rename(const char *path, mode_t mode, const char *bytes, int
             return refuse_with(LC_BAD_FILE, S_ISLNK(there.st_mode)   ? ELOOP
                                             : S_ISDIR(there.st_mode) ? EISDIR
                                                                      : EINVAL);
+        // The other names of the file would keep the old bytes.
         if (there.st_nlink != 1)
             return refuse_with(LC_BAD_FILE, EMLINK);
         if (!overwrite)
@@ -144,6 +146,7 @@ lc_status write_and_rename(const char *path, mode_t mode, const char *bytes, int
     const lc_status written = write_all(file.fd, bytes, count);
     if (written)
         return written;
+    // Until here the mode is 0600, from mkostemp. Unlike open, fchmod ignores the umask.
     if (fchmod(file.fd, mode) != 0)
         return status_of_errno();
     // RENAME_NOREPLACE: a file that has been created since the check is not replaced.

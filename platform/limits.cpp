@@ -47,10 +47,12 @@ bool apply_line(const char *line, platform_limits *limits) {
     if (*at == '\0' || *at == '#')
         return true;
     for (const auto &limit : known_limits) {
+        // A name must be followed by a blank; otherwise it is the beginning of a longer one.
         const size_t length = strlen(limit.name);
         if (strncmp(at, limit.name, length) != 0 || (at[length] != ' ' && at[length] != '\t'))
             continue;
         at = skip_blanks(at + length);
+        // A sign, which strtoul would accept, is refused.
         if (!isdigit(static_cast<unsigned char>(*at)))
             return false;
         char *end = nullptr;
@@ -72,8 +74,10 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
     platform_limits limits = defaults;
     if (out_bad_line)
         *out_bad_line = 0;
+    // The e in the mode sets O_CLOEXEC.
     FILE *file = fopen(path, "re");
     if (!file) {
+        // A file that does not exist is normal: it only replaces the defaults.
         if (errno != ENOENT && !out_bad_line)
             QV_LOG(LC_LOG_WARNING, "%s cannot be read (%m): using the defaults", path);
         return limits;
@@ -92,6 +96,7 @@ platform_limits platform_limits_read(const char *path, uint32_t *out_bad_line) {
         }
         more = c != EOF;
         line[length] = '\0';
+        // Lines may end with CR LF.
         line[strcspn(line, "\r")] = '\0';
         // A comment may be of any length.
         if ((good || *skip_blanks(line) == '#') && apply_line(line, &limits))

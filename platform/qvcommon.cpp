@@ -28,6 +28,7 @@ std::atomic<int> events_without_transport;
 } // namespace
 
 void qvif_network_init_sockets() {
+    // The builtins, because the exported variable is a plain integer.
     if (__atomic_load_n(&g_qvif_skfd, __ATOMIC_ACQUIRE) >= 0)
         return;
     const int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
@@ -54,6 +55,7 @@ int qv_state_event_send(uint32_t one, const char *group_id, uint32_t role, const
 }
 
 char *get_addr_str(int family, be32 address, int, char *buffer, size_t size) {
+    // The family is the version number of the protocol, not an AF_ constant.
     if (buffer && size > 0 &&
         (family != 4 || !inet_ntop(AF_INET, &address, buffer, static_cast<socklen_t>(size))))
         buffer[0] = '\0';

@@ -155,6 +155,7 @@ void update_link(const interface *now) {
         holder->name[0] = '\0'; // it has been renamed or deleted, and its own notification follows
     interface *before = find_by_index(&known, now->index);
     if (!before) {
+        // Without memory, a scan tries again later.
         if (!add_interface(&known, now))
             return request_scan();
         report_link(now->name, now->admin_up, now->link_up);
@@ -178,6 +179,7 @@ void remove_link(int index) {
     if (!entry)
         return;
     const interface old = *entry;
+    // The last entry takes the free place.
     *entry = known.entries[--known.count];
     if (old.name[0])
         report_gone(old.name);
@@ -247,6 +249,7 @@ bool query_all_links(interface_table *out) {
     nl_socket_modify_cb(socket, NL_CB_VALID, NL_CB_CUSTOM, on_scan_answer, out);
     int result = -NLE_DUMP_INTR;
     for (int tries = 0; tries < SCAN_TRIES && result == -NLE_DUMP_INTR; tries++) {
+        // Family AF_UNSPEC, which is 0, asks for all interfaces.
         ifinfomsg all = {};
         out->count = 0;
         result = nl_send_simple(socket, RTM_GETLINK, NLM_F_DUMP, &all, sizeof all);
@@ -269,6 +272,7 @@ bool scan_links() {
     known = fresh;
     for (uint32_t i = 0; i < old.count; i++) {
         const interface *now = find_by_index(&known, old.entries[i].index);
+        // Renamed counts as gone: the groups know an interface by its name.
         if (!now || strncmp(now->name, old.entries[i].name, IFNAMSIZ) != 0)
             report_gone(old.entries[i].name);
     }
@@ -293,6 +297,7 @@ void *run_monitor(void *) {
         if (poll(fds, 2, wait) < 0)
             continue;
         uint64_t ignored;
+        // Reading sets the eventfd's counter back to 0.
         if (fds[1].revents && read(wake_fd, &ignored, sizeof ignored) < 0)
             continue;
         if (fds[0].revents) {
@@ -356,6 +361,7 @@ int qv_netlink_register(uint32_t kind, qv_netlink_callback callback) {
 int qv_netlink_start(uint32_t kind) {
     if (kind >= QV_NOTIFY_KINDS || !callbacks[kind].load(std::memory_order_acquire))
         return EINVAL;
+    // Cancelled in between, the caller would leave descriptors without the thread that uses them.
     const cancel_off_guard whole;
     const mutex_guard guard(&start_mutex);
     int error = 0;
@@ -367,6 +373,7 @@ int qv_netlink_start(uint32_t kind) {
             close_descriptors();
     }
     if (error == 0) {
+        // Before the scan, which reports only to kinds that have been started.
         started.fetch_or(1u << kind, std::memory_order_acq_rel);
         request_scan();
         const uint64_t one = 1;

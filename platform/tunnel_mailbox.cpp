@@ -29,6 +29,7 @@ wccp_tunnel_mailbox *wccp_mailbox;
 bool wccp_attach_mailbox() {
     if (mailbox_get(wccp_mailbox))
         return true;
+    // A tunneld that starts before wccpd finds no block yet.
     if (cmem_exists_block(WCCP_MAILBOX_NAME) != 1)
         return false;
     uint64_t length = 0;
@@ -56,6 +57,7 @@ bool wccp_withdraw_command(wccp_tunnel_mailbox *mailbox) {
 
 // A new socket for each call: commands are rare, and after a restart tunneld has a new socket at the path.
 void wccp_wake_tunneld() {
+    // Cancellation in sendto or close would leave the descriptor open.
     const cancel_off_guard whole;
     const int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (fd < 0)
@@ -63,6 +65,7 @@ void wccp_wake_tunneld() {
     sockaddr_un to = {};
     to.sun_family = AF_UNIX;
     memcpy(to.sun_path, WCCP_WAKE_UP_PATH, sizeof WCCP_WAKE_UP_PATH);
+    // Errors do not matter: tunneld also polls the slot, and only answers later.
     (void)sendto(fd, "", 1, MSG_DONTWAIT | MSG_NOSIGNAL, reinterpret_cast<const sockaddr *>(&to), sizeof to);
     close(fd);
 }
@@ -97,6 +100,7 @@ inputs read_inputs(const wccp_tunnel_mailbox *mailbox) {
         const inputs second = read_inputs_once(mailbox);
         const uint16_t after = mailbox->command.load(std::memory_order_acquire);
         const bool whole = before == between && between == after && before != MAILBOX_IDLE && first == second;
+        // The limit keeps tunneld from waiting for a wccpd that was stopped while it wrote.
         if (whole || tries == 1000)
             return second;
     }
@@ -139,12 +143,14 @@ bool wccp_set_tunnel_command_status(uint32_t status) {
     wccp_tunnel_mailbox *mailbox = mailbox_get(wccp_mailbox);
     if (!mailbox)
         return false;
+    // The result first: wccpd reads it as soon as it finds `command` cleared.
     mailbox_put(mailbox->status, status);
     return mailbox->command.exchange(MAILBOX_IDLE, std::memory_order_acq_rel) != MAILBOX_IDLE;
 }
 
 uint32_t wccp_get_role(uint16_t policy_group) {
     if (!wccp_attach_mailbox())
-        return 2;
+        return 2; // UNKNOWN
+    // The table has a place for each 16-bit number.
     return wccp_mailbox->policy_roles[policy_group].role.load(std::memory_order_relaxed);
 }
