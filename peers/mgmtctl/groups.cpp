@@ -217,6 +217,7 @@ std::vector<ctl_change_item> router_changes(const std::string &root, const std::
                                             const std::vector<std::string> &after) {
     std::vector<ctl_change_item> items;
     for (size_t i = 0; i < std::max(before.size(), after.size()); i++) {
+        // mgmtd's entries are numbered from 1 without a gap: a place in the list gives the number.
         const std::string entry = root + "/router/" + std::to_string(i + 1);
         if (i >= after.size())
             items.push_back({ctl_change::remove, {entry, "", ""}});
