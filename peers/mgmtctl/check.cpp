@@ -79,6 +79,7 @@ struct judging {
         one.offered = offered;
         one.wanted = wanted;
         fill_reason(check_texts(), &one);
+        // Groups that share an interface have the same finding; once is enough.
         const auto same = [&](const reason &other) {
             return other.cause == one.cause && other.next == one.next;
         };
@@ -105,6 +106,7 @@ bool skip_without_groups(judging *work) {
 }
 
 bool is_in_the_way(const check_facts &facts, const check_socket &socket) {
+    // Without mgmtd the interfaces of the groups are unknown, and any socket may collide.
     if (socket.address == ANY_ADDRESS || !facts.mgmtd_error.empty())
         return true;
     bool found = false;
@@ -121,6 +123,7 @@ void judge_port(judging *work) {
     for (const check_socket &socket : facts.sockets) {
         if (socket.program == "wccpd" || !is_in_the_way(facts, socket))
             continue;
+        // Without root the owner of a socket is hidden, and wccpd is the most likely one.
         if (socket.program.empty() && facts.wccpd_runs)
             work->note_unchecked("only root sees whether it is wccpd who has the port on " + socket.address);
         else
@@ -151,6 +154,7 @@ void judge_interfaces(judging *work) {
 }
 
 bool is_own_link(const std::string &name) {
+    // "wccp" and a number, as tunneld names its links.
     return name.starts_with("wccp") && name.size() > 4 &&
            std::all_of(name.begin() + 4, name.end(), [](char c) { return c >= '0' && c <= '9'; });
 }
@@ -193,6 +197,7 @@ void judge_forwarding(judging *work) {
 void judge_packets(judging *work, const nlohmann::json &rules, const check_group &group) {
     for (const bool gre : {false, true})
         for (const bool outgoing : {false, true}) {
+            // Such a group is redirected without GRE.
             if (gre && group.encap == "l2")
                 continue;
             const filter_finding found = judge_packet(rules, {gre, outgoing, group.interface});
@@ -212,6 +217,7 @@ void judge_firewall(judging *work) {
     const check_facts &facts = work->facts;
     if (!facts.legacy_error.empty())
         work->note_unchecked("the tables of iptables cannot be read: " + facts.legacy_error);
+    // Their rules filter as well, but are not in nftables' listing.
     else if (!facts.legacy_tables.empty())
         work->note_unchecked("iptables has tables of its own (" + facts.legacy_tables +
                              "), which this cannot read: look through iptables-legacy-save");
@@ -246,6 +252,7 @@ void judge_kernel(judging *work) {
         if (feature == check_feature::unknown)
             work->note_unchecked(std::string("neither the kernel nor its modules say whether it has ") +
                                  name);
+    // One of the two is enough: tunneld can do GRE itself, through TUN.
     if (facts.gre == check_feature::missing && facts.tun != check_feature::unknown)
         work->add_finding(facts.tun == check_feature::missing ? "gre-missing" : "gre-by-tun", -1, "");
     else if (facts.tun == check_feature::missing)
@@ -267,6 +274,7 @@ void judge_memory(judging *work) {
         work->note_unchecked("wccpd is not running: its limit is the one of its unit");
     else if (!facts.lock_limit_error.empty())
         work->note_unchecked(facts.lock_limit_error);
+    // CAP_IPC_LOCK exempts a process from the limit.
     else if (!facts.may_lock && facts.lock_limit_bytes)
         work->add_finding("memory-lock", -1, "", std::to_string(*facts.lock_limit_bytes / 1024) + " KiB");
 }
@@ -274,6 +282,7 @@ void judge_memory(judging *work) {
 // False when the file could not be read.
 bool judge_file(judging *work, const check_file &file, const char *path, const char *unreadable,
                 const char *line) {
+    // wccpd may run as a user that can read what this one cannot.
     if (file.error == EACCES && !work->facts.root)
         work->note_unchecked(std::string(path) + ": " + strerror(file.error));
     else if (file.error)
@@ -353,6 +362,7 @@ int tell_checks(const ctl_options &options, const check_result &result) {
         std::string &names = unchecked[each.why];
         names.append(names.empty() ? "" : ", ").append(each.check);
     }
+    // Many checks share an obstacle, such as missing rights; it is printed once.
     for (const auto &[why, names] : unchecked)
         write_output(std::string("not checked: ").append(names).append(": ").append(why).append("\n"));
     std::string fine;

@@ -40,6 +40,7 @@ std::optional<long> number_in(const std::string &path) {
 
 std::string link_text(const std::string &path) {
     char text[256];
+    // readlink() adds no terminating zero.
     const ssize_t length = readlink(path.c_str(), text, sizeof text);
     return length > 0 ? std::string(text, static_cast<size_t>(length)) : std::string();
 }
@@ -73,12 +74,15 @@ void gather_interfaces(check_facts *out) {
     ifaddrs *all = nullptr;
     if (getifaddrs(&all) != 0)
         return;
+    // The ioctl for the MTU takes any socket.
     const int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
     const std::string settings = "/proc/sys/net/ipv4/conf/";
+    // One entry for each address. An interface without an address has an AF_PACKET entry all the same.
     for (const ifaddrs *one = all; one; one = one->ifa_next) {
         std::string name = one->ifa_name;
         name.resize(std::min(name.size(), name.find(':'))); // an alias such as eth0:1
         check_interface &interface = out->interfaces[name];
+        // IFF_RUNNING is cleared when the carrier is lost.
         interface.up = (one->ifa_flags & IFF_UP) && (one->ifa_flags & IFF_RUNNING);
         interface.rp_filter = number_in(settings + name + "/rp_filter");
         interface.forwarding = number_in(settings + name + "/forwarding");
@@ -104,6 +108,7 @@ void gather_interfaces(check_facts *out) {
 template <typename Function>
 void for_processes(const Function &function) {
     for (const std::string &name : names_in("/proc")) {
+        // Only the directories of processes begin with a number.
         const int id = number_of(name, 0);
         if (id > 0 && !function(id, "/proc/" + name))
             return;
@@ -118,6 +123,7 @@ std::string address_of(const std::string &text) {
     if (text.size() != 8 && !text.starts_with(mapped))
         return "";
     in_addr address = {};
+    // The kernel prints s_addr as one number of this machine. Reading that number gives network order again.
     address.s_addr = static_cast<uint32_t>(strtoul(text.substr(text.size() - 8).c_str(), nullptr, 16));
     char out[INET_ADDRSTRLEN];
     return inet_ntop(AF_INET, &address, out, sizeof out) ? out : "";
@@ -132,6 +138,7 @@ void read_sockets(const char *path, std::map<std::string, check_socket> *inout) 
         std::istringstream words(line);
         std::string slot, local, skipped, inode;
         words >> slot >> local;
+        // Remote address, state, queues, timer, retransmissions, user, timeout.
         for (int i = 0; i < 7; i++)
             words >> skipped;
         words >> inode;
@@ -154,6 +161,8 @@ void gather_sockets(check_facts *out) {
     read_sockets("/proc/net/udp", &sockets);
     read_sockets("/proc/net/udp6", &sockets);
     if (!sockets.empty())
+        // A process has the socket if a link in its fd directory names the inode. Without root those of other
+        // users cannot be read, and their sockets stay without a name.
         for_processes([&](int id, const std::string &directory) {
             const std::string descriptors = directory + "/fd/";
             for (const std::string &name : names_in(descriptors)) {
@@ -173,6 +182,7 @@ void gather_sockets(check_facts *out) {
 void gather_wccpd(check_facts *out) {
     const std::string network = link_text("/proc/self/ns/net");
     for_processes([&](int, const std::string &directory) {
+        // Without root the namespace of another user's process cannot be read; it is assumed to be this one.
         const std::string other = link_text(directory + "/ns/net");
         if (first_line(directory + "/comm").value_or("") != "wccpd" || (!other.empty() && other != network))
             return true;
@@ -208,16 +218,20 @@ void gather_filter(check_facts *out) {
     else if (!context || nft_ctx_buffer_output(context) != 0 || nft_ctx_buffer_error(context) != 0)
         out->filter_error = "out of memory";
     else {
+        // Protocols as numbers: their names would come from the host's /etc/protocols.
         nft_ctx_output_set_flags(context, NFT_CTX_OUTPUT_JSON | NFT_CTX_OUTPUT_NUMERIC_PROTO);
         const bool done = nft_run_cmd_from_buffer(context, "list ruleset") == 0;
         const char *text = done ? nft_ctx_get_output_buffer(context) : nft_ctx_get_error_buffer(context);
         std::string &to = done ? out->filter_listing : out->filter_error;
         to = text && *text ? text : "no reason given";
+        // The lines after the first repeat the command and mark a column.
         if (!done)
             to.resize(std::min(to.size(), to.find('\n')));
     }
     if (context)
         nft_ctx_free(context);
+    // The old iptables of the kernel. The file exists only when its module is loaded, and only root may read
+    // it.
     std::ifstream tables("/proc/net/ip_tables_names");
     if (!tables && access("/proc/net/ip_tables_names", F_OK) == 0)
         out->legacy_error = strerror(EACCES);
@@ -242,12 +256,15 @@ void gather_kernel(check_facts *out) {
     std::string line;
     for (const char *list : {"dep", "builtin"})
         for (std::ifstream in(modules + list); std::getline(in, line);) {
+            // After the colon, modules.dep has the modules that this one needs.
             line.resize(std::min(line.size(), line.find(':')));
             for (auto &one : wanted)
                 one.found = one.found || line.find(one.module) != std::string::npos;
         }
     bool all = std::all_of(std::begin(wanted), std::end(wanted), [](const auto &one) { return one.found; });
     bool readable = false;
+    // In a container /lib/modules is often missing, but the symbols are those of the running kernel. Without
+    // root the addresses are zero; the names are not hidden.
     if (!all)
         for (std::ifstream in("/proc/kallsyms"); std::getline(in, line); readable = true) {
             const size_t name = line.find(' ', line.find(' ') + 1) + 1; // ADDRESS TYPE NAME [MODULE]

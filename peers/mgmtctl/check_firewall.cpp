@@ -118,6 +118,8 @@ answer walker::holds(const json &left, const json &right) const {
                           field = text_at(left["payload"], "field");
         if (of == "ip")
             return field == "protocol" ? number(protocol) : answer::maybe;
+        // "th" is the header after IP's, whatever it is. In a GRE packet such a condition compares other
+        // fields: it is unclear.
         if (of == "udp" || (of == "th" && !packet.gre)) {
             if (packet.gre)
                 return answer::no;
@@ -165,14 +167,19 @@ fate walker::apply(const std::string &verdict, const json &body, answer conditio
         result = fate::dropped;
     else if (verdict == "return")
         result = fate::returned;
+    // After a chain that returns, a jump continues with the next rule. A goto does not come back: it ends the
+    // present chain as a return would.
     else if (verdict == "jump" || verdict == "goto") {
         result = walk_chain(table + text_at(body, "target"), depth + 1);
         if (result == fate::returned || (result == fate::goes_on && verdict == "goto"))
             result = verdict == "goto" ? fate::returned : fate::goes_on;
     } else if (verdict != "continue")
         result = fate::accepted; // or changed, or passed to a program
+    // A rule that applies only perhaps is noted, and the evaluation continues. The verdict of a queue is that
+    // of another program, and never known.
     if (condition == answer::yes && verdict != "queue")
         return result;
+    // What follows a return, a rule or the policy, may be either.
     may_accept = may_accept || result == fate::accepted || result == fate::returned;
     may_drop = may_drop || result == fate::dropped || result == fate::returned || verdict == "queue";
     return verdict == "queue" && condition == answer::yes ? fate::accepted : fate::goes_on;
@@ -258,6 +265,7 @@ bool is_on_the_way(const json &chain, const filtered_packet &packet) {
     const std::string hook = text_at(chain, "hook"), family = text_at(chain, "family");
     if (hook.empty() || (family != "ip" && family != "inet" && family != "netdev"))
         return false;
+    // Chains of all types and priorities count.
     if (packet.outgoing ? hook != "output" && hook != "postrouting" && hook != "egress"
                         : hook != "ingress" && hook != "prerouting" && hook != "input")
         return false;
@@ -291,11 +299,13 @@ filter_finding judge_packet(const json &objects, const filtered_packet &packet) 
     walker walk = {packet, {}, {}, "", false, false};
     read_listing(objects, &walk);
     filter_finding worst;
+    // The packet passes only if every chain on its way accepts it: the worst result counts.
     for (const auto &[name, chain] : walk.chains) {
         if (!is_on_the_way(chain.head, packet))
             continue;
         walk.table = text_at(chain.head, "family") + " " + text_at(chain.head, "table") + " ";
         walk.may_accept = walk.may_drop = false;
+        // A chain that ends without a verdict has that of its policy.
         fate end = walk.walk_chain(name, 0);
         if (end != fate::accepted && end != fate::dropped)
             end = text_at(chain.head, "policy") == "drop" ? fate::dropped : fate::accepted;

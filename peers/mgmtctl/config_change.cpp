@@ -110,6 +110,7 @@ bool read_config(const std::string &content, const std::string &file, const node
     }
     bool good = keep_hidden(&text.tree, present, &reason);
     if (merge)
+        // insert() does not replace: values of the file have precedence.
         text.tree.set.insert(present.set.begin(), present.set.end());
     out->set = std::move(text.tree.set);
     tree_refresh(out);
@@ -124,6 +125,7 @@ bool read_config(const std::string &content, const std::string &file, const node
 std::vector<node_change> config_changes(const node_tree &before, const node_tree &after) {
     std::vector<node_change> changes = tree_difference(before.nodes, after.nodes);
     std::erase_if(changes, [&](const node_change &change) {
+        // A default that appears or disappears together with its group.
         return (!change.before && !after.set.contains(change.name)) ||
                (!change.after && !before.set.contains(change.name));
     });
@@ -139,6 +141,7 @@ std::vector<ctl_change_item> items_of(const std::vector<node_change> &changes, c
             out.push_back({ctl_change::create, {name, type_name(change.after->type), change.after->text}});
             continue;
         }
+        // Deleted with the instance above it.
         if (!gone.parts.empty() && change.name.is_under(gone))
             continue;
         if (!change.after && find_schema_row(change.name)->instance)

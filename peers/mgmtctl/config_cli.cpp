@@ -96,6 +96,7 @@ void put_plan(const ctl_options &options, const plan &made) {
     if (options.json)
         return;
     put_changes(options, made.changes);
+    // The notes go to standard error. Where both end in one file, they must not come before the changes.
     fflush(stdout);
     for (const std::string &note : made.notes.notes)
         fprintf(stderr, "mgmtctl: note: %s\n", note.c_str());
@@ -141,6 +142,7 @@ bool read_file(const std::string &file, std::string *out, std::string *out_reaso
     const int fd = file == "-" ? STDIN_FILENO : open(file.c_str(), O_RDONLY | O_CLOEXEC);
     char bytes[65536];
     ssize_t got = fd < 0 ? -1 : 1;
+    // One block beyond the limit is read, to tell a file that is too large from one that just fits.
     while (got > 0 && out->size() <= FILE_MAX_BYTES) {
         got = read(fd, bytes, sizeof bytes);
         if (got < 0 && errno == EINTR && !ctl_stop_signal)
@@ -172,6 +174,7 @@ int apply_code(const ctl_apply_options &how, int code) {
 int apply_plan(connection *mgmtd, const plan &made, const ctl_apply_options &how, uint32_t revision) {
     const ctl_options &options = mgmtd->options;
     ctl_reply reply;
+    // Applying the same file again makes no commit.
     if (made.changes.empty())
         return tell_plan(options, made, revision, false, 0, CTL_OK);
     put_plan(options, made);
@@ -199,6 +202,7 @@ int ctl_apply(const ctl_options &options, const std::string &file, const ctl_app
         return apply_code(how, mgmtd.code);
     if (!read_config(content, file == "-" ? "standard input" : file, present.tree, how.merge, &wanted,
                      &errors)) {
+        // Its last newline, which tell_failure() adds.
         errors.pop_back();
         return tell_failure(options, {CTL_USAGE, "", errors, "", 0});
     }
@@ -348,6 +352,7 @@ bool choose_commits(connection *mgmtd, uint32_t *inout_from) {
         mgmtd->code = tell_failure(
             mgmtd->options, {CTL_NOT_FOUND, "", "there is no commit before the last one", "", LC_NOT_FOUND});
     else
+        // The latest is first: the second one is the commit before it.
         *inout_from = static_cast<uint32_t>(std::strtoul(commits[1].number.c_str(), nullptr, 10));
     return *inout_from != 0;
 }

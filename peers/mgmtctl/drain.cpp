@@ -83,6 +83,7 @@ void leave_out_others(const std::string &group, std::vector<traffic_drain> *inou
 
 int tell_end(const ctl_options &options, const std::vector<traffic_drain> &drains, size_t expected) {
     const bool cancelled = drains.size() < expected;
+    // "over": the group has left although flows were open.
     const bool over =
         std::any_of(drains.begin(), drains.end(), [](const auto &each) { return each.state != "drained"; });
     if (options.json)
@@ -105,6 +106,7 @@ int wait_for_end(const ctl_options &options, const ctl_link &link, const std::st
         if (!ask_drains(link, &drains, &failure))
             return tell_failure(options, failure);
         leave_out_others(group, &drains);
+        // A drain that was seen and is missing later has been cancelled.
         expected = std::max(expected, drains.size());
         if (!options.json)
             put_progress(before, drains);
@@ -114,6 +116,7 @@ int wait_for_end(const ctl_options &options, const ctl_link &link, const std::st
             }))
             return tell_end(options, drains, expected);
         before = drains;
+        // After a signal the next query fails, which ends the loop.
         if (!ctl_stop_signal)
             nanosleep(&LOOK_AGAIN, nullptr);
     }

@@ -51,6 +51,7 @@ void print_reasons(const snapshot &shown, const std::vector<reason> &reasons) {
 
 int tell_reasons(const ctl_options &options, const snapshot &shown, int group) {
     std::vector<reason> reasons = reasons_of(shown);
+    // Reasons of the whole appliance stay: they can keep any group from working.
     std::erase_if(reasons,
                   [&](const reason &each) { return group >= 0 && each.group >= 0 && each.group != group; });
     const bool failed = !shown.unreachable.empty() || (group >= 0 && shown.groups.empty());

@@ -145,6 +145,8 @@ bool read_secret(std::string *out) {
     char byte = '\0';
     ssize_t got = 0;
     out->clear();
+    // Byte by byte, so that nothing after the line is consumed. A signal ends read(), and the echo is
+    // restored below.
     while (out->size() < SECRET_MAX && (got = read(STDIN_FILENO, &byte, 1)) == 1 && byte != '\n')
         *out += byte;
     if (terminal) {
@@ -159,6 +161,7 @@ int ctl_group(const ctl_options &options, const std::vector<std::string> &words)
     if (words.size() == 1 && words[0] == "words")
         return list_words(options);
     std::vector<std::string> filled = words;
+    // Words are VERB NUMBER WORD VALUE WORD VALUE ...
     for (size_t i = 3; i < filled.size(); i += 2)
         if (filled[i - 1] == "password" && filled[i] == "-" && !read_secret(&filled[i]))
             return tell_failure(options, {CTL_USAGE, "", "there is no password on standard input", "", 0});

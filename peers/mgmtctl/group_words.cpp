@@ -92,6 +92,7 @@ std::string parse_group_wish(const std::vector<std::string> &words, group_wish *
         const std::string &value = words[i + 1];
         const bool nothing = !word->free_text && (value == "default" || value == "none");
         if (std::string(word->node) == "router") {
+            // "router none" alone makes the list exist and leaves it empty.
             if (!out->routers)
                 out->routers.emplace();
             if (std::find(out->routers->begin(), out->routers->end(), value) != out->routers->end())
@@ -112,6 +113,7 @@ std::string shell_quoted(const std::string &text) {
         return text;
     std::string out = "'";
     for (const char c : text)
+        // Ends the quotes, adds an escaped quote, and begins them again.
         out += c == '\'' ? std::string("'\\''") : std::string(1, c);
     return out + "'";
 }

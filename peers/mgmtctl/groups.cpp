@@ -77,6 +77,7 @@ bool read_group(const ctl_link &link, const std::string &root, group_nodes *out,
 } // namespace
 
 std::vector<std::string> group_routers(const group_nodes &nodes) {
+    // As text, router 10 would come before router 2.
     std::map<long, std::string> numbered;
     for (const auto &[name, value] : nodes)
         if (name.starts_with("router/") && name.ends_with("/ipaddr"))
@@ -135,6 +136,7 @@ void wait_for_wccpd(const ctl_link &link, bool wanted, group_result *inout) {
             return;
         }
         if (reply.code != 0) {
+            // The commit has been made; wccpd follows when it is back.
             inout->wccpd = reply.code == LC_IO_CLOSED ? "absent" : "silent";
             return;
         }
@@ -201,6 +203,7 @@ void restart_group(const ctl_link &link, const std::string &root, group_result *
     if (!read_existing_group(link, root, &nodes, inout))
         return;
     std::vector<ctl_change_item> items = creation_items(root, nodes);
+    // Deletion and creation in one commit: if mgmtd refuses, the group stays as it is.
     items.insert(items.begin(), {ctl_change::remove, {root, "", ""}});
     if (!commit_items(link, items, inout))
         return;
@@ -214,6 +217,7 @@ std::vector<ctl_change_item> router_changes(const std::string &root, const std::
                                             const std::vector<std::string> &after) {
     std::vector<ctl_change_item> items;
     for (size_t i = 0; i < std::max(before.size(), after.size()); i++) {
+        // mgmtd's entries are numbered from 1 without a gap: a place in the list gives the number.
         const std::string entry = root + "/router/" + std::to_string(i + 1);
         if (i >= after.size())
             items.push_back({ctl_change::remove, {entry, "", ""}});
@@ -239,6 +243,7 @@ void change_group(const ctl_link &link, const std::string &root, const group_wis
     for (const auto &[node, value] : wish.values) {
         const group_word *word = find_group_word(node);
         const char *fallback = group_word_fallback(*word);
+        // Both sides as mgmtd keeps them: the default where nothing is set, and 0x0a as 10.
         const auto otherwise = fallback ? std::optional<std::string>(fallback) : std::nullopt;
         const auto old = before.find(node);
         const auto present_value = old != before.end() ? std::optional(old->second) : otherwise;
@@ -250,9 +255,11 @@ void change_group(const ctl_link &link, const std::string &root, const group_wis
             after[node] = *to;
         else
             after.erase(node);
+        // Back to the default by a reset, so that the file holds no default.
         items.push_back({value ? ctl_change::modify : ctl_change::reset, {name, "", value ? *to : ""}});
         if (word->change == group_change::at_start)
             at_start += std::string(at_start.empty() ? "" : ", ") + word->word;
+        // Without a default a running group cannot lose the value without being recreated.
         if (word->change == group_change::as_whole || (!value && !fallback))
             as_whole += std::string(as_whole.empty() ? "" : ", ") + word->word;
     }

@@ -30,14 +30,17 @@ struct unfinished_page {
 bool write_content(int fd, const std::string &content) {
     for (size_t done = 0; done < content.size();) {
         const ssize_t wrote = write(fd, content.data() + done, content.size() - done);
+        // A short write is continued; a full disk is an error of the next one.
         if (wrote < 0 && errno != EINTR)
             return false;
         done += wrote > 0 ? static_cast<size_t>(wrote) : 0;
     }
+    // Before the rename: after a crash the name must not lead to an empty file.
     return fsync(fd) == 0;
 }
 
 mode_t mode_of_new_file() {
+    // umask() reports the mask only by setting another one.
     const mode_t mask = umask(0);
     umask(mask);
     return 0666 & ~mask;
@@ -46,6 +49,7 @@ mode_t mode_of_new_file() {
 } // namespace
 
 bool write_page_file(const std::string &path, const std::string &content, std::string *out_reason) {
+    // A rename would replace a symbolic link; the file that it leads to is replaced instead.
     const std::unique_ptr<char, decltype(&free)> found(realpath(path.c_str(), nullptr), free);
     const std::string target = found ? found.get() : path;
     struct stat old;
@@ -55,6 +59,7 @@ bool write_page_file(const std::string &path, const std::string &content, std::s
         return false;
     }
     const unfinished_page fresh(target);
+    // mkostemp() creates the file for its owner only.
     if (fresh.fd < 0 || fchmod(fresh.fd, exists ? old.st_mode & 07777 : mode_of_new_file()) != 0 ||
         !write_content(fresh.fd, content) || rename(fresh.path.c_str(), target.c_str()) != 0) {
         *out_reason = strerror(errno);

@@ -62,6 +62,7 @@ std::string counts_text(const snapshot_table &table) {
         if (const auto count = std::count(table.owners.begin(), table.owners.end(), owner); count > 0)
             out += (out.empty() ? "" : ", ") + name + " " + std::to_string(count);
     };
+    // A table without any owner has been dropped, and is not empty here.
     const int most = *std::max_element(table.owners.begin(), table.owners.end());
     for (int owner = 0; owner <= most; owner++)
         add(owner, std::string(1, appliance_letter(owner)));
@@ -73,6 +74,7 @@ std::string counts_text(const snapshot_table &table) {
 
 void add_strip(std::string *out, const html_view &view, const snapshot_group &group,
                const snapshot_table &table) {
+    // Where the wanted table is unknown nothing differs.
     const auto wanted = [&](size_t bucket) {
         return group.wanted.owners.empty() ? owner_at(table, bucket) : owner_at(group.wanted, bucket);
     };
@@ -81,6 +83,7 @@ void add_strip(std::string *out, const html_view &view, const snapshot_group &gr
     for (size_t first = 0, end; first < count; first = end) {
         const int owner = table.owners[first];
         const bool other = owner != wanted(first);
+        // Cells with the same owner and the same wanted owner share an element, up to the end of the line.
         for (end = first + 1; end < count && !view.each_bucket && end % CELLS != 0 &&
                               table.owners[end] == owner && wanted(end) == wanted(first);)
             end++;
@@ -205,6 +208,7 @@ html_markup table_badge(const snapshot_group &group, const snapshot_router &rout
         std::find_if(group.tables.begin(), group.tables.end(), [&](const snapshot_table &each) {
             return std::find(each.routers.begin(), each.routers.end(), router.id) != each.routers.end();
         });
+    // Such a table has been dropped by drop_misread_tables().
     const bool misread = std::any_of(group.reasons.begin(), group.reasons.end(), [&](const auto &each) {
         return each.code == "method-differs" && (each.sender == router.id || each.sender == router.address);
     });
@@ -244,6 +248,7 @@ void add_appliance(std::string *out, const snapshot_group &group, size_t place) 
     const snapshot_appliance &one = group.appliances[place];
     const size_t colour = place % PAGE_COLOURS;
     const bool wanted = one.asked_percent >= 0;
+    // A difference of 1 % is rounding.
     const bool short_of =
         wanted && one.reported && std::abs(static_cast<int>(one.least_percent) - one.asked_percent) > 1;
     add_html(out, "<tr><td><span class=\"cells key\"><b class=\"o", colour, "\"><i>",
@@ -264,6 +269,7 @@ void add_appliance(std::string *out, const snapshot_group &group, size_t place) 
              share_words(one), "\" title=\"has ", share_words(one));
     if (wanted)
         add_html(out, ", wanted ", one.asked_percent, "%");
+    // -10 % puts the mark of an unknown share outside of the bar.
     add_html(out, "\" style=\"--has:", one.reported ? one.least_percent : 0,
              "%;--wanted:", wanted ? one.asked_percent : -10, "%\"></span></td></tr>\n");
 }
@@ -307,6 +313,7 @@ style proxy_style(const traffic_intercept &intercept) {
 void add_summary(std::string *out, const html_view &view, const snapshot_group &group) {
     const reason *cause = main_reason(view.reasons, group.id);
     const auto [words, how] = group_state_words(view.shown, group, cause != nullptr);
+    // Without an answer of wccpd only a disabled group has a known state.
     const bool silent =
         !group.running && view.shown.wccpd != wccpd_condition::running && group.admin != "down";
     add_html(out, "<summary><span class=\"id\">Group ", group.id, "</span> ",
@@ -356,6 +363,7 @@ void add_group(std::string *out, const html_view &view, const snapshot_group &gr
     add_summary(out, view, group);
     // The name is inside: a link to it unfolds the group.
     add_html(out, "<div class=\"body\" id=\"group-", group.id, "\">\n");
+    // Reasons that need attention come before the facts, the others after them.
     for (const reason &each : view.reasons)
         if (each.group == group.id && each.attention)
             add_reason(out, each, false);

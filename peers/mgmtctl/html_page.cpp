@@ -45,8 +45,10 @@ headline choose_headline(const html_view &view) {
     std::string detail = known                    ? first->cause
                          : shown.alarms_total > 0 ? plural_text(shown.alarms_total, "alarm")
                                                   : "A router's table is not as wanted.";
+    // One group, and the first reason is its own: the title names it.
     if (needing.size() == 1 && (!known || first->group == needing[0]->id))
         return {how, "Group " + std::to_string(needing[0]->id) + " needs attention", detail};
+    // The title counts groups; the detail has to name its own.
     if (known && first->group >= 0)
         detail = "Group " + std::to_string(first->group) + ": " + detail;
     if (!needing.empty())
@@ -92,6 +94,7 @@ void add_group_tiles(std::string *out, const snapshot &shown) {
         connected += connected_routers(group);
     }
     const std::string counts = group_counts(shown);
+    // The tile has its own title: only the part after "2 groups: " is shown.
     const size_t colon = counts.find(": ");
     add_tile(out, "Groups", html_of(shown.groups_total),
              colon == std::string::npos ? "" : counts.substr(colon + 2));
@@ -148,6 +151,7 @@ void add_attention(std::string *out, const html_view &view) {
     const bool several = groups_in_need(view, true).size() > 1;
     size_t count = 0;
     for (const reason &each : view.reasons) {
+        // The count goes on beyond the limit, for the line below.
         if (!each.attention || (each.group >= 0 && !several) || ++count > LISTED_REASONS)
             continue;
         if (count == 1)

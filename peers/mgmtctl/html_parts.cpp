@@ -86,6 +86,7 @@ std::vector<table_kind> make_table_kinds() {
         {"members", {"appliance", "passed on", "received", "delivered", "returned"}},
         {"refused", {"source", "packets", "state"}},
     };
+    // One more column for each possible outcome of a packet.
     for (table_kind &kind : kinds)
         if (kind.name == std::string("intercepts"))
             for (const sorted_way &way : sorted_ways())
@@ -257,6 +258,8 @@ std::string html_style() {
             .append(text);
         out.append("}.bar.").append(name).append("{--colour:").append(background).append("}\n");
     }
+    // On a narrow screen a row is a block: the head of each column is repeated in its cell. The first cell is
+    // the block's title.
     out += "@media screen and (max-width:46rem){";
     for (const table_kind &kind : table_kinds())
         for (size_t i = 1; i < kind.heads.size(); i++)

@@ -48,6 +48,7 @@ std::string refused_text(const refused_counts &refused) {
 
 std::string bytes_text(uint64_t bytes) {
     const std::string count = count_text(bytes);
+    // "512 B", but "12kB".
     return count + (count.back() >= '0' && count.back() <= '9' ? " B" : "B");
 }
 
@@ -73,6 +74,7 @@ void add_refused(std::string *out, const traffic_state &traffic) {
         add_html(out, "<p>Refused: ", refused, "</p>\n");
     if (!traffic.refused_sources.empty() || !traffic.accepted.empty()) {
         open_table(out, "refused");
+        // The counters keep packets that came before their source was accepted.
         for (const auto &[address, packets] : traffic.refused_sources)
             add_html(out, "<tr><td>", address, "</td><td>", count_text(packets), "</td><td>",
                      traffic.accepted.contains(address)

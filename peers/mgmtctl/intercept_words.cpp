@@ -39,6 +39,7 @@ std::string take_list(const intercept_word &row, const std::vector<std::string> 
     if (list.empty())
         return needs_value(row);
     const auto [at, fresh] = inout->emplace(row.node, list);
+    // "port" and "all" set the same node.
     if (!fresh && at->second == "all")
         return PORT_AND_ALL;
     if (!fresh && !at->second)
@@ -147,6 +148,7 @@ std::string intercept_clauses(const std::map<std::string, std::string> &nodes) {
     for (const intercept_word &row : intercept_words()) {
         const auto found = nodes.find(row.node);
         const char *fallback = fallback_of(row.node);
+        // The node "ports" has two clauses, of which only the one that fits its value is printed.
         const bool all = std::string(row.word) == "all";
         if (found == nodes.end() || found->second.empty() || (fallback && found->second == fallback) ||
             (std::string(row.node) == "ports" && all != (found->second == "all")))

@@ -98,6 +98,7 @@ void delete_root(const ctl_link &link, const std::string &root, const char *done
 std::vector<ctl_change_item> change_items(const std::string &root, const intercept_wish &wish,
                                           const node_texts &before) {
     std::vector<ctl_change_item> items;
+    // The entry itself. It may be all there is, for example of an accepted source without a router.
     if (before.empty())
         items.push_back({ctl_change::create, {root, "", ""}});
     for (const auto &[node, value] : wish) {
@@ -140,6 +141,7 @@ std::string misfit_note(const ctl_link &link, const std::string &number, const s
         return "";
     if (group.empty())
         return "there is no group " + number + "; the intercept has no effect until the group exists";
+    // A protocol that is not set is TCP, for the group as for the intercept.
     const std::string redirected = group.contains("protocol") ? group["protocol"] : "tcp";
     if (protocol_number(redirected) == protocol_number(protocol))
         return "";
@@ -161,6 +163,7 @@ void set_intercept(const ctl_link &link, const std::string &root, bool fresh, co
     node_texts before;
     if (!read_nodes(link, root, &before, inout))
         return;
+    // `add` needs a new one, `set` an existing one.
     if (fresh != before.empty()) {
         *inout =
             fresh ? with_failure(*inout, CTL_REFUSED,
@@ -231,6 +234,7 @@ traffic_result bypass_command(const ctl_link &link, const std::vector<std::strin
             verb.empty() || verb == "show" ? USAGE : unknown_word_text(verb, {"add", "delete", "show"}));
     if (words.size() != 2 && (verb == "delete" || words.size() != 4))
         return with_failure(result, CTL_USAGE, USAGE);
+    // A single host.
     result.subject = words[1].find('/') == std::string::npos ? words[1] + "/32" : words[1];
     if (const char *wrong = check_prefix(&result.subject))
         return with_failure(result, CTL_USAGE, wrong); // printed after the kind and the subject
@@ -244,6 +248,8 @@ traffic_result bypass_command(const ctl_link &link, const std::vector<std::strin
         if (words[2] != "for")
             return with_failure(result, CTL_USAGE, unknown_word_text(words[2], {"for"}));
         const int64_t seconds = number_of<int64_t>(words[3], 0);
+        // Written back and compared: signs, leading zeros and trailing letters are refused. The node has 32
+        // bits.
         if (std::to_string(seconds) != words[3] || seconds < 1 || now + seconds > UINT32_MAX)
             return with_failure(result, CTL_USAGE, "\"for\" needs a number of seconds");
         until = now + seconds;

@@ -21,6 +21,7 @@ struct held_session {
 } // namespace
 
 ctl_link link_to_mgmtd(const ctl_options &options) {
+    // Shared by the functions below and their copies. The last of them closes it.
     const auto held = std::make_shared<held_session>(options.timeout_ms);
     ctl_link link;
     link.query = [held](ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {

@@ -43,11 +43,15 @@ int finish_output(int code) {
     errno = 0;
     const bool written = fflush(stdout) == 0 && !ferror(stdout);
     const int error = errno;
+    // A watch that is ended by a signal has succeeded. Any other command was interrupted, and the shell has
+    // to see that.
     if (ctl_stop_signal && code != CTL_OK)
         end_by_signal(ctl_stop_signal);
     if (written || ctl_stop_signal)
         return code;
     pollfd out = {STDOUT_FILENO, 0, 0};
+    // The failed write may have been an earlier one, whose errno is lost. poll reports a pipe without readers
+    // even if no event is requested.
     if (error == EPIPE || (poll(&out, 1, 0) == 1 && (out.revents & POLLERR)))
         end_by_signal(SIGPIPE);
     fprintf(stderr, "mgmtctl: standard output: %s\n", error ? strerror(error) : "not all of it was written");
@@ -70,11 +74,13 @@ std::vector<std::string> shield_words(int argc, char **argv) {
             word->insert(0, 1, SHIELD);
         plain = plain || *word == "--";
     }
+    // Only the first "--" is unmarked; a later one is a word.
     std::erase(out, "--");
     return out;
 }
 
 int usage_error(const CLI::App &app, const std::vector<std::string> &arguments, std::string error) {
+    // No command was recognised: the first word is the wrong one.
     if (app.get_subcommands().empty()) {
         error = "a word is missing";
         for (auto word = arguments.rbegin(); word != arguments.rend(); ++word)
@@ -115,6 +121,7 @@ struct command_line {
 CLI::App *add_command(command_line *line, const char *word, const char *about,
                       std::function<int()> function) {
     CLI::App *command = line->app.add_subcommand(word, about);
+    // Only noted here: it must run after the marks of the words have been removed.
     command->callback([line, function = std::move(function)] { line->run = function; });
     return command;
 }

@@ -41,6 +41,7 @@ bool take_count(const std::string &text, std::string *out) {
 // With a decimal point before the last `digits` digits.
 template <size_t digits>
 bool take_fraction(const std::string &text, std::string *out) {
+    // By digits instead of floating point: nothing is rounded, and no locale changes the point.
     *out = text.size() > digits ? text : std::string(digits + 1 - text.size(), '0') + text;
     out->insert(out->size() - digits, ".");
     return is_count(text);
@@ -117,6 +118,7 @@ struct gathering {
 void add_label(std::string *inout, std::string_view name, std::string_view value) {
     inout->append(inout->empty() ? "" : ",").append(name).append("=\"");
     for (const char c : value.substr(0, LABEL_MAX)) {
+        // The format's escapes. A newline cannot occur, because control characters are replaced.
         if (c == '"' || c == '\\')
             *inout += '\\';
         *inout += c < 0x20 || c > 0x7e ? '?' : c;
@@ -174,6 +176,7 @@ void add_node_samples(const gathering &work, const std::vector<ctl_binding> &bin
         for (size_t i = 0; i < std::size(way_rows); i++) {
             if (!matches_pattern(way_patterns[i], name) || !is_count(binding.value))
                 continue;
+            // The label is taken from the last part of the name, which must not contain the suffix.
             std::string *way = &name.parts.back();
             const bool bytes = way_rows[i].bytes != 0 && way->ends_with("_bytes");
             if (bytes)
@@ -205,6 +208,7 @@ bool gather_tunneld(const gathering &work) {
                   {NODE_PLANE_STATE, NODE_TUNNEL_STATE, NODE_INTERCEPT_STATE, NODE_PROTECTION_STATE}, &reply))
         return false;
     const auto plane = std::ranges::find(reply.bindings, NODE_PLANE_STATE "/name", &ctl_binding::name);
+    // A running tunneld always has a data plane.
     const bool running = plane != reply.bindings.end();
     work.add(metric_place("wccp_daemon_up"), make_label("daemon", "tunneld"), running ? "1" : "0");
     if (running)
@@ -265,10 +269,12 @@ void add_text_line(const gathering &work, const std::string &group_labels, std::
     if (count == 3 && (words[0] == "gauge" || words[0] == "counter"))
         return add_named_number(work, group_labels, words[1], words[2]);
     for (const line_row &row : text_lines()) {
+        // A line of another length comes from another version of wccpd.
         if (count != 1 + row.labels + row.families.size() || words[0] != row.word)
             continue;
         std::string labels = group_labels;
         std::string_view names = metric_families[row.families[0]].labels;
+        // The label "group" is in `group_labels` already, or left out for wccpd as a whole.
         if (names.starts_with("group "))
             (void)take_word(&names);
         for (size_t i = 0; i < row.labels; i++)
@@ -294,6 +300,7 @@ bool gather_groups(const gathering &work) {
     std::vector<std::string> names;
     for (const ctl_binding &binding : reply.bindings)
         if (parts_below(NODE_GROUP_STATE, binding.name).size() == 1 && names.size() < GROUPS_MAX)
+            // One text for all metrics of a group.
             names.push_back(binding.name + "/metric/all");
     for (size_t first = 0; first < names.size(); first += GROUPS_AT_ONCE) {
         const auto from = names.begin() + static_cast<std::ptrdiff_t>(first);
@@ -330,6 +337,7 @@ bool gather_mgmtd(const gathering &work) {
         return false;
     work.add(metric_place("wccp_daemon_up"), make_label("daemon", "mgmtd"), "1");
     add_node_samples(work, reply.bindings);
+    // The answer also has the processes, which are not alarms.
     std::erase_if(reply.bindings, [](const ctl_binding &binding) {
         return parts_below(NODE_ALARMS_RAISED, binding.name).empty();
     });
@@ -349,6 +357,7 @@ bool gather_metrics(const metric_source &source, metric_lines *out) {
     const gathering work{source, out};
     if (gather_mgmtd(work) && gather_wccpd(work) && gather_tunneld(work))
         return true;
+    // A part of the samples would look like groups that are gone. One sample reports the failure instead.
     *out = {};
     work.add(metric_place("wccp_daemon_up"), make_label("daemon", "mgmtd"), "0");
     return false;

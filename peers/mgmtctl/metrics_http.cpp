@@ -20,6 +20,7 @@ constexpr int64_t REQUEST_MS = 5000;
 std::string read_request() {
     std::string request;
     const int64_t until = lt_monotonic_ms() + REQUEST_MS;
+    // GET and HEAD have no body: the request ends with the empty line after the headers.
     while (request.size() < REQUEST_MAX && request.find("\r\n\r\n") == std::string::npos) {
         pollfd in = {STDIN_FILENO, POLLIN, 0};
         const int64_t left = until - lt_monotonic_ms();
@@ -42,6 +43,7 @@ int answer_request(const char *status, const char *type, const std::vector<std::
     write_output("HTTP/1.1 " + std::string(status) + "\r\nContent-Type: " + type +
                  "\r\nContent-Length: " + std::to_string(length) + "\r\nConnection: close\r\n\r\n");
     for (const std::string &piece : body)
+        // The answer to HEAD has the length of the body, but not the body.
         if (with_body)
             write_output(piece);
     return code;
@@ -69,6 +71,7 @@ int serve_metrics_request(const ctl_link &link) {
     const size_t from = first.find(' ') + 1, to = first.find(' ', from);
     if (first.substr(from, to - from) != "/metrics")
         return answer_request("404 Not Found", PLAIN, {"the metrics are at /metrics\n"}, !head, CTL_USAGE);
+    // Any mention of the modern format selects it; the weights of an Accept header are not compared.
     const metric_format format = request.find("application/openmetrics-text") != std::string::npos
                                      ? metric_format::openmetrics
                                      : metric_format::text;

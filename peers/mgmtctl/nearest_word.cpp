@@ -6,6 +6,8 @@ namespace {
 constexpr size_t LETTERS_MAX = 64; // that are compared
 
 size_t edit_distance(const std::string &a, const std::string &b) {
+    // The Levenshtein distance, with one row of its table: row[j] is the distance of a's first i letters from
+    // b's first j.
     std::vector<size_t> row(b.size() + 1);
     for (size_t j = 0; j <= b.size(); j++)
         row[j] = j;
@@ -29,6 +31,7 @@ const std::string *nearest_word(const std::string &word, const std::vector<std::
     for (const std::string &each : known) {
         const bool begins = word.size() > 1 && each.starts_with(word);
         const size_t away = begins ? 0 : edit_distance(word.substr(0, LETTERS_MAX), each);
+        // With as many mistakes as letters, any short word would be near.
         if (away < least && away < std::min(word.size(), each.size())) {
             least = away;
             best = &each;

@@ -46,6 +46,7 @@ int ctl_get(const ctl_options &options, const std::vector<std::string> &names) {
         nodes.push_back(json_failure(failure));
         if (!options.json)
             (void)tell_failure(options, failure);
+        // The remaining names are tried all the same; the exit code is that of the first failure.
         code = code == CTL_OK ? failure.exit : code;
     }
     if (options.json)
@@ -113,6 +114,7 @@ int commit_change(const ctl_options &options, const std::vector<ctl_change_item>
         return mgmtd.code;
     groups_before before;
     ctl_reply reply;
+    // The notes compare with the values before the commit, which cannot be queried afterwards.
     if (!look_before(mgmtd.asker(), items, &before) ||
         !ctl_set(mgmtd.session.get(), items, {options.cause}, &reply, &mgmtd.reason))
         return mgmtd.lost();
@@ -215,6 +217,7 @@ int ctl_alarms(const ctl_options &options, bool check) {
 // Prints nothing but completions, even on failure: the shell calls it while somebody types.
 int ctl_complete(const std::string &word) {
     std::string reason;
+    // Without a session the names of the schema are completed all the same.
     const ctl_held_session session(ctl_open(1000, &reason));
     const ctl_ask ask = [&](ctl_walk walk, const std::string &name, ctl_reply *out) {
         return session && ctl_query(session.get(), walk, name, out, &reason);

@@ -62,6 +62,7 @@ std::vector<std::string> names_below(const ctl_ask &ask, const node_name &above)
     for (node_name pattern : known_patterns()) {
         if (pattern.parts.size() <= depth)
             continue;
+        // Cut to the depth of `above`, the pattern shows whether a longer name can begin with `above`.
         const std::string next = pattern.parts[depth];
         pattern.parts.resize(depth);
         if (!matches_pattern(pattern, above))
@@ -98,11 +99,13 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
     node_name name;
     if (!parse_node_name(text, &name))
         return text.starts_with('/') ? "a name has no empty part" : "a name begins with \"/\"";
+    // A wrong group number comes first: the rest of such a name is usually right.
     if (const std::string group = group_of(text); !group.empty()) {
         ctl_reply reply;
         if (ask(ctl_walk::node, group, &reply) && reply.bindings.empty())
             return "there is no group " + number_of(group);
     }
+    // A name that exists, but only as the beginning of longer ones.
     ctl_reply below;
     if (ask(ctl_walk::subtree, text, &below) && !below.bindings.empty())
         return "it has no value of its own; \"mgmtctl walk " + text + "\" lists what is below";
@@ -164,6 +167,7 @@ std::vector<std::string> complete_node_name(const ctl_ask &ask, const std::strin
     if (const size_t equals = word.find('='); equals != std::string::npos)
         return value_completions(word.substr(0, equals), word.substr(equals + 1));
     size_t slash = word.rfind('/');
+    // An escaped slash belongs to a part and does not end it.
     while (slash != std::string::npos && slash > 0 && word[slash - 1] == '\\')
         slash = word.rfind('/', slash - 1);
     if (slash == std::string::npos)
@@ -184,10 +188,13 @@ bool query_walk(const ctl_ask &ask, ctl_walk how, const node_name &root, ctl_rep
     ctl_reply whole;
     if (!ask(how, root.text(), out))
         return false;
+    // Only an answer that is too large for a message is asked for in pieces. The recursion ends, because
+    // each name is longer than the one before.
     const std::vector<std::string> parts =
         out->code == LC_NO_BUFFER_SPACE ? names_below(ask, root) : std::vector<std::string>{};
     if (parts.empty())
         return true;
+    // The pieces begin below the root, whose own value a subtree includes.
     if (how == ctl_walk::subtree && !ask(ctl_walk::node, root.text(), &whole))
         return false;
     for (const std::string &part : parts) {
@@ -279,6 +286,7 @@ bool look_before(const ctl_ask &ask, const std::vector<ctl_change_item> &items, 
         const std::string root = group_of(item.binding.name);
         if (root.empty())
             continue;
+        // The group's root tells whether the group exists, the node its present value.
         for (const std::string &name : {root, item.binding.name}) {
             ctl_reply reply;
             if (!ask(ctl_walk::node, name, &reply))
@@ -346,8 +354,10 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
         const std::string after = !removed               ? kept_value(name, item.binding.value)
                                   : row && row->fallback ? row->fallback
                                                          : "";
+        // There is no default to fall back to: a running group cannot lose the value without being recreated.
         if (removed && old && row && !row->fallback)
             whole[root].insert(name.substr(root.size() + 1));
+        // Setting the present value again changes nothing and needs no note.
         else if (!old || old->value != after)
             for (auto *words : {&whole, &at_start})
                 if (const std::string word = changed_word(
@@ -360,6 +370,7 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
             out.notes.push_back("group " + number_of(root) + ": wccpd applies a change of " +
                                 join_words(words) + " only by recreating the group");
     for (const auto &[root, words] : at_start)
+        // A group that is recreated anyway applies these changes as well.
         if (!ended.contains(root) && !whole.contains(root))
             out.notes.push_back("group " + number_of(root) + ": " +
                                 at_start_note(join_words(words), number_of(root)));

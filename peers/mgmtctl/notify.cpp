@@ -93,6 +93,7 @@ void log_complaint(notifier *self, const std::string &complaint) {
 bool load_book(notifier *self) {
     std::ifstream in(self->how.state_file, std::ios::binary);
     if (!in)
+        // Without a file, as at the first start, all subjects are in their first state.
         return errno == ENOENT;
     std::string text(BOOK_BYTES_MAX, '\0');
     in.read(text.data(), static_cast<std::streamsize>(text.size()));
@@ -110,6 +111,7 @@ void save_book(notifier *self) {
     std::ofstream out(fresh, std::ios::binary | std::ios::trunc);
     out << text;
     out.close();
+    // The name always leads to a complete file, the old one or the new one.
     if (!out || rename(fresh.c_str(), self->how.state_file.c_str()) != 0)
         log_line(self->how.state_file + ": " + strerror(errno) +
                  "; after a restart, changes will be reported again");
@@ -145,6 +147,7 @@ void try_to_connect(notifier *self) {
         log_line("follows mgmtd");
         self->complaint.clear();
         self->lost_at_ms = -1;
+        // At once: changes may have been missed while there was no session.
         self->compare_at_ms = now;
         return;
     }
@@ -152,6 +155,7 @@ void try_to_connect(notifier *self) {
     self->connect_at_ms = lt_monotonic_ms() + CONNECT_MS;
     log_complaint(self, reason);
     if (self->lost_at_ms >= 0 && now - self->lost_at_ms >= GIVE_UP_MS) {
+        // So that the roles become UNKNOWN only once.
         self->lost_at_ms = -1;
         notify_compare(&self->book, notify_kind::role, {}); // wccpd doesn't run without mgmtd
     }
@@ -163,6 +167,7 @@ void compare_states(notifier *self) {
         ctl_reply reply;
         std::string reason;
         if (!ctl_query(self->session.get(), ctl_walk::subtree, notify_node(kind), &reply, &reason)) {
+            // A signal also makes the query fail; the session is not lost then.
             if (!ctl_stop_signal)
                 lose_session(self, reason);
             return;
@@ -188,6 +193,7 @@ std::vector<reason> find_reasons(notifier *self, const notify_change &change) {
     limits.only = notify_group(change.subject);
     if (limits.only < 0)
         limits.queries = 0; // no queries about groups
+    // The gathering still uses the session: it is dropped afterwards.
     std::string lost;
     const snapshot shown = gather_snapshot(
         [&](ctl_walk walk, const std::string &node, ctl_reply *out, std::string *out_reason) {
@@ -219,6 +225,8 @@ std::vector<std::string> find_commands(notifier *self) {
 void start_next_change(notifier *self) {
     if (self->runner != 0 || self->book.waiting.empty())
         return;
+    // The change stays in the queue during the query. If a signal ends the program meanwhile, it is reported
+    // after the next start.
     const std::vector<reason> reasons = find_reasons(self, self->book.waiting.front());
     notify_change change;
     if (ctl_stop_signal || !notify_take(&self->book, &change))
@@ -246,6 +254,7 @@ void finish_change(notifier *self, bool wait) {
     close(self->runner_fd);
     self->runner = 0;
     self->runner_fd = -1;
+    // The process itself was killed.
     const int outcome = WIFEXITED(status) ? WEXITSTATUS(status) : NOTIFY_FAILED;
     self->reported++;
     self->failed += outcome == NOTIFY_FAILED;
@@ -273,6 +282,7 @@ void wait_for_news(notifier *self) {
             take_event(self, event);
         return;
     }
+    // The pidfd becomes readable when the runner exits; -1 is ignored.
     pollfd ended = {self->runner_fd, POLLIN, 0};
     poll(&ended, 1, static_cast<int>(LOOK_MS));
 }
@@ -293,6 +303,7 @@ void serve_changes(notifier *self) {
         wait_for_news(self);
     }
     if (self->runner != 0)
+        // The runner gives the present command a few seconds, and skips the others.
         kill(self->runner, SIGTERM);
     finish_change(self, true);
     log_line("ends: " + describe_counts(*self));
@@ -315,6 +326,8 @@ bool become_user(const ctl_notify_options &how, std::string *out_reason) {
         *out_reason = user ? "commands are not run as root" : "there is no user " + how.user;
         return false;
     }
+    // The directory first, while this is root; the groups before the user, because only root can change them.
+    // The last call must fail, or root could be regained.
     if (make_state_directory(how.state_file, user->pw_uid, user->pw_gid) &&
         initgroups(how.user.c_str(), user->pw_gid) == 0 && setgid(user->pw_gid) == 0 &&
         setuid(user->pw_uid) == 0 && setuid(0) != 0)

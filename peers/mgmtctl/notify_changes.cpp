@@ -59,6 +59,7 @@ void notify_note(notify_book *book, const notify_subject &subject, const std::st
         book->merged++;
         book->say(describe_subject(subject) + ": " + older->state + " was replaced by " + state +
                   " before its turn (" + std::to_string(book->merged) + " replaced so far)");
+        // `previous` stays: it is the state for which commands were last run.
         older->state = state;
         older->detail = detail;
         older->time = book->clock_s();
@@ -81,6 +82,7 @@ void notify_note(notify_book *book, const notify_subject &subject, const std::st
 void notify_compare(notify_book *book, notify_kind kind, const std::map<std::string, notify_state> &present) {
     for (const auto &[name, now] : present)
         notify_note(book, {kind, name}, now.state, now.detail);
+    // Collected first, because the loop below changes both containers.
     std::vector<notify_subject> missing;
     const auto add_missing = [&](const notify_subject &subject) {
         if (subject.kind == kind && !present.contains(subject.name))
@@ -91,6 +93,7 @@ void notify_compare(notify_book *book, notify_kind kind, const std::map<std::str
     for (const notify_change &change : book->waiting)
         add_missing(change.subject);
     for (const notify_subject &subject : missing) {
+        // The intercept was deleted: there is nothing to report.
         if (kind == notify_kind::health) {
             book->reported.erase(subject);
             std::erase_if(book->waiting, [&](const auto &each) { return each.subject == subject; });
@@ -105,6 +108,7 @@ bool notify_take(notify_book *book, notify_change *out) {
         return false;
     *out = std::move(book->waiting.front());
     book->waiting.pop_front();
+    // Not kept, or the file would grow with each alarm that was ever raised.
     if (out->state == notify_first_state(out->subject.kind))
         book->reported.erase(out->subject);
     else
@@ -131,6 +135,7 @@ size_t notify_read_book(notify_book *book, const std::string &text) {
                                        [&](const kind_row &each) { return kind == each.word; });
         if (row == std::end(KINDS) || name.empty() || clean_text(name, NAME_MAX_BYTES) != name ||
             state.size() > STATE_MAX ||
+            // Blanks on both sides: only whole words match.
             (" " + std::string(row->states)).find(" " + state + " ") == std::string::npos ||
             book->reported.size() >= SUBJECTS_MAX)
             unreadable++;

@@ -75,12 +75,14 @@ sigset_t awaited_signals() {
     for (int number = 1; number < NSIG; number++) // ignored signals would remain ignored
         signal(number, SIG_DFL);
     sigprocmask(SIG_SETMASK, &none, nullptr);
+    // Standard output and error stay those of the service: its log.
     const int nothing = open("/dev/null", O_RDWR);
     if (nothing < 0 || dup2(nothing, STDIN_FILENO) < 0 || chdir("/") != 0)
         _exit(127);
     close_range(3, ~0U, 0);
     std::vector<std::string> kept = run.environment;
     for (char **each = environ; *each; each++)
+        // Variables of the service's own environment could pass for those of the change.
         if (strncmp(*each, "WCCP_", 5) != 0)
             kept.emplace_back(*each);
     std::vector<char *> environment;
@@ -103,6 +105,7 @@ std::string describe_end(int status) {
 bool reap_group(pid_t group, int *out_status) {
     for (;;) {
         int status = 0;
+        // Children of the command are reaped as well, because this process is their subreaper.
         const pid_t ended = waitpid(-group, &status, WNOHANG);
         if (ended == group)
             *out_status = status;
@@ -126,6 +129,7 @@ notify_outcome wait_for_group(pid_t group, const notify_run &run, const std::str
     int sent = 0, status = 0;
     while (!reap_group(group, &status)) {
         const int got = wait_for_signal(due_ms);
+        // A signal that stops the service shortens the wait once; further ones change nothing.
         if (got != 0 && got != SIGCHLD && !*inout_stop) {
             *inout_stop = true;
             due_ms = std::min(due_ms, lt_monotonic_ms() + run.patience_ms);
@@ -140,10 +144,13 @@ notify_outcome wait_for_group(pid_t group, const notify_run &run, const std::str
             run.say(path + (*inout_stop
                                 ? ": ended with this service"
                                 : ": not done after " + std::to_string(run.limit_ms / 1000) + " s, ended"));
+        // First SIGTERM; if that does not help within the patience, SIGKILL; then the command is given up
+        // above.
         sent = sent == 0 ? SIGTERM : SIGKILL;
         kill(-group, sent);
         due_ms = lt_monotonic_ms() + run.patience_ms;
     }
+    // Even if it exited with 0 after the signal.
     if (sent != 0)
         return NOTIFY_TIMED_OUT;
     if (status == 0)
@@ -216,12 +223,14 @@ bool start_notify_commands(const notify_run &run, pid_t *out_pid, int *out_pidfd
     if (pid == 0) {
         signal(SIGCHLD, SIG_DFL); // if it were ignored, waitpid would not report the commands
         prctl(PR_SET_PDEATHSIG, SIGTERM);
+        // A parent that ended before prctl() sends no signal any more.
         _exit(getppid() == parent ? run_notify_commands(run) : NOTIFY_FAILED);
     }
     *out_pid = pid;
     *out_pidfd = pidfd_open(pid, 0);
     if (*out_pidfd >= 0)
         return true;
+    // Without a pidfd the end of the process would not be noticed.
     const int error = errno;
     kill(pid, SIGTERM);
     waitpid(pid, nullptr, 0);

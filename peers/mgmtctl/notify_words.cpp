@@ -61,6 +61,7 @@ notify_states read_health(const ctl_reply &reply) {
         else if (parts[1] == "proxy_reason")
             out[group].detail = clean_text(binding.value, VALUE_MAX);
     }
+    // The reason of a proxy whose state is missing.
     std::erase_if(out, [](const auto &each) { return each.second.state.empty(); });
     return out;
 }
@@ -97,10 +98,13 @@ change_words explain_change(const notify_change &change, const std::vector<reaso
     const int group = notify_group(change.subject);
     switch (change.subject.kind) {
     case notify_kind::role:
+        // What works needs no reason.
         if (change.state == "ACTIVE")
             return {};
+        // Roles also become UNKNOWN when wccpd or mgmtd is gone, which is not the fault of a group.
         return words_of(find_absence(reasons) ? find_absence(reasons) : first_reason(reasons, group), "");
     case notify_kind::alarm:
+        // An alarm may have been cleared only because the daemon that raised it is gone.
         return words_of(change.state == "raised" ? alarm_reason(reasons, group, alarm, source)
                                                  : find_absence(reasons),
                         change.detail);
@@ -109,6 +113,7 @@ change_words explain_change(const notify_change &change, const std::vector<reaso
     }
     if (change.state == "up")
         return {};
+    // Made from the change itself: the proxy's present state may be newer.
     reason down;
     down.code = "proxy-down";
     down.group = group;

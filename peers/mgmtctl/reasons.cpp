@@ -167,6 +167,7 @@ size_t place_of(const std::string &code) {
     const std::vector<reason_text> &texts = reason_texts();
     const auto found =
         std::find_if(texts.begin(), texts.end(), [&](const reason_text &row) { return code == row.code; });
+    // A code that is not in the table gets the place after its last row, and is sorted after all others.
     return static_cast<size_t>(found - texts.begin());
 }
 } // namespace
@@ -185,6 +186,8 @@ std::string fill_placeholders(std::string text, const reason &from) {
         {"{group}", from.group < 0 ? "GROUP" : std::to_string(from.group)},
     };
     for (const auto &[name, value] : values)
+        // Continues after the inserted value: values come from the network, and one could contain its own
+        // placeholder.
         for (size_t at = 0; (at = text.find(name, at)) != std::string::npos; at += value.size())
             text.replace(at, std::string(name).size(), value);
     return text;
@@ -194,7 +197,9 @@ std::string fill_placeholders(std::string text, const reason &from) {
 void fill_reason(const std::vector<reason_text> &texts, reason *inout) {
     const auto found = std::find_if(texts.begin(), texts.end(),
                                     [&](const reason_text &row) { return inout->code == row.code; });
+    // A newer daemon may report a code for which this program has no words. It still needs attention.
     const reason_text *text = found != texts.end() ? &*found : find_reason_text(inout->code);
+    // tunneld's reasons bring a finished text with values of their own.
     if (inout->cause.empty())
         inout->cause = text ? fill_placeholders(text->cause, *inout)
                             : inout->code + (inout->who.empty() ? "" : " of " + inout->who);
@@ -219,6 +224,8 @@ struct reason_list {
         made->who = who;
         made->offered = offered;
         made->wanted = wanted;
+        // The uptime begins when the role becomes ACTIVE or BACKUP, and is 0 before; then the state has
+        // lasted since the group was started.
         if (group.running)
             made->first_ms = static_cast<int64_t>(group.uptime_ms ? group.uptime_ms : group.since_ms);
     }
@@ -233,6 +240,7 @@ bool has_reason(const snapshot_group &group, std::initializer_list<const char *>
 }
 
 bool is_about(const snapshot_reason &reason, const snapshot_router &router) {
+    // A packet that is refused before its router identity is read is known only by its source address.
     return (!reason.sender.empty() && (reason.sender == router.address || reason.sender == router.id)) ||
            reason.source == router.address;
 }
@@ -242,6 +250,7 @@ const snapshot_reason *last_reason(const std::vector<snapshot_reason> &reasons,
                                    const std::function<bool(const snapshot_reason &)> &wanted) {
     const snapshot_reason *found = nullptr;
     for (const snapshot_reason &each : reasons)
+        // These times are ages: the smaller one is the later occurrence.
         if (wanted(each) && (!found || each.last_ms < found->last_ms))
             found = &each;
     return found;
@@ -279,6 +288,7 @@ bool is_lasting(const std::string &code) {
 }
 
 void add_noted(const std::vector<snapshot_reason> &noted, int group, reason_list *list) {
+    // A router that does not list this appliance cannot be two-way, and blocks the election for that reason.
     const auto is_unlisted = [&](const std::string &router) {
         return std::any_of(noted.begin(), noted.end(), [&](const snapshot_reason &each) {
             return each.code == "not-in-view" && each.sender == router;
@@ -301,6 +311,7 @@ void add_noted(const std::vector<snapshot_reason> &noted, int group, reason_list
 }
 
 void add_unheard_routers(const snapshot &shown, const snapshot_group &group, reason_list *list) {
+    // Without a working interface no router can answer. The group has the reason for that already.
     if (has_reason(group, {"interface-missing", "interface-down", "interface-no-address", "port-taken",
                            "socket-failed", "join-failed"}))
         return;
@@ -309,6 +320,7 @@ void add_unheard_routers(const snapshot &shown, const snapshot_group &group, rea
             continue;
         list->add_state("no-answer", group, router.address,
                         std::to_string(group.here_i_ams) + " Here-I-Am sent");
+        // Not since the group became ACTIVE with other routers: this one has been silent since the start.
         list->reasons.back().first_ms = static_cast<int64_t>(group.since_ms);
     }
 }
@@ -325,18 +337,24 @@ void add_missing_traffic(const snapshot_group &group, reason_list *list) {
         if (!one.self && one.most_percent > 0)
             others +=
                 (others.empty() ? "" : ", ") + one.address + " " + std::to_string(one.most_percent) + "%";
+    // BACKUP: the routers use a table that gives this appliance nothing, as intended with the weight 0.
     if (group.state == "BACKUP")
         list->add_state(group.weight == 0 ? "weight-zero" : "redirected-elsewhere", group, "",
                         others.empty() ? "nobody" : others);
+    // INIT although routers answer: no table has arrived. Nobody sends one in the two excluded cases, which
+    // have reasons of their own.
     else if (group.state == "INIT" && two_way && !has_reason(group, {"election-blocked", "table-not-built"}))
         list->add_state("waiting-assignment", group, "",
                         (group.designated ? "this appliance" : lowest_appliance(group)) + " is designated");
+    // In INIT, "waiting-assignment" names the designated appliance already.
     if (group.state != "INIT" && !group.designated && !lowest_appliance(group).empty() &&
         lowest_appliance(group) != group.address)
         list->add_state("not-designated", group, lowest_appliance(group), "");
 }
 
 void add_group_reasons(const snapshot &shown, const snapshot_group &group, reason_list *list) {
+    // Nothing follows from the state of a disabled group. What wccpd noted is listed all the same, for
+    // example a router that still sends to it.
     if (group.admin == "down") {
         list->add_state("disabled", group, "", "");
         add_noted(group.reasons, group.id, list);
@@ -346,6 +364,8 @@ void add_group_reasons(const snapshot &shown, const snapshot_group &group, reaso
         list->add_state("no-interface", group, "", "");
     else if (group.configured && group.routers_configured == 0)
         list->add_state("no-router", group, "", "");
+    // Without an answer of wccpd it is unknown which groups it has. A group that has left has the reason
+    // "left".
     else if (!group.running && shown.wccpd == wccpd_condition::running &&
              !shown.traffic.left.contains(group.id))
         list->add_state("not-taken", group, "", "");
@@ -353,21 +373,27 @@ void add_group_reasons(const snapshot &shown, const snapshot_group &group, reaso
         return;
     if (!group.configured)
         list->add_state("not-configured", group, "", "");
+    // mgmtd has wccpd disable a group that is out of its routers. "left" or "drain" explains that better than
+    // "group-disabled".
     std::vector<snapshot_reason> noted = group.reasons;
     const bool out = is_out_of_its_routers(shown, group);
     if (out)
         std::erase_if(noted, [](const snapshot_reason &each) { return each.code == "group-disabled"; });
     add_noted(noted, group.id, list);
     for (const snapshot_router &router : group.routers)
+        // Refusals of packets whose group was not known yet count for the groups of the sender. Those of the
+        // group itself have just been added.
         if (const snapshot_reason *each = router_reason(shown, group, router);
             each && std::none_of(group.reasons.begin(), group.reasons.end(),
                                  [&](const snapshot_reason &own) { return &own == each; }))
             add_noted({*each}, group.id, list);
+    // A brief snapshot has no routers and appliances from which anything could follow.
     if (shown.brief)
         return;
     if (!out)
         add_unheard_routers(shown, group, list);
     add_missing_traffic(group, list);
+    // The data plane "table" carries no packets, and needs no intercepts.
     const bool sorts = shown.traffic.tunneld == tunneld_condition::running && shown.traffic.plane != "table";
     const bool intercepted =
         std::any_of(shown.traffic.intercepts.begin(), shown.traffic.intercepts.end(),
@@ -387,6 +413,7 @@ void add_traffic_reasons(const snapshot &shown, reason_list *list) {
         made->first_ms = each.first_ms;
         made->last_ms = each.last_ms;
         for (const snapshot_group &group : shown.groups)
+            // tunneld does not know since when the group has not been ACTIVE; wccpd does.
             if (each.word == "standing-by" && group.id == each.group && group.running)
                 made->first_ms = static_cast<int64_t>(group.uptime_ms ? group.uptime_ms : group.since_ms);
         if (!each.who.empty())
@@ -402,6 +429,7 @@ void add_traffic_reasons(const snapshot &shown, reason_list *list) {
 void add_process_reason(const snapshot &shown, const std::string &name, bool absent, reason_list *list) {
     reason *made = list->add_reason((name + (absent ? "-absent" : "-silent")).c_str(), -1);
     const auto known = shown.processes.find(name);
+    // mgmtd's entry was read at another moment than the failed query. Its time counts only if both agree.
     if (known != shown.processes.end() && known->second.running != absent)
         made->first_ms = ms_since(absent ? known->second.since : known->second.silent_since);
 }
@@ -436,6 +464,8 @@ std::vector<reason> reasons_of(const snapshot &shown) {
     for (reason &each : list.reasons) {
         fill_reason(reason_texts(), &each);
     }
+    // Reasons of the whole appliance have the group -1 and come first. Several of one code stay in the order
+    // in which they were found.
     std::stable_sort(list.reasons.begin(), list.reasons.end(), [](const reason &a, const reason &b) {
         return a.group != b.group ? a.group < b.group : place_of(a.code) < place_of(b.code);
     });
@@ -452,6 +482,9 @@ const reason *main_reason(const std::vector<reason> &reasons, int group) {
 namespace {
 // The first reason that can have caused the alarm, or else the main one.
 const reason *group_alarm_reason(const std::vector<reason> &reasons, int group, bool adjacency) {
+    // The table's order also tells what a reason can break. All up to the assignment table can keep routers
+    // from becoming two-way; those from "election-blocked" up to traffic can spoil an assignment. A service
+    // mismatch is only noted: wccpd accepts that router.
     const size_t last = place_of("election-blocked"), table = place_of("mask-differs"),
                  end = place_of("lack");
     for (const reason &each : reasons) {
@@ -468,6 +501,8 @@ const reason *alarm_reason(const std::vector<reason> &reasons, int group, const 
                            const std::string &source) {
     if (group >= 0 && (alarm == "adjacency" || alarm == "assignment"))
         return group_alarm_reason(reasons, group, alarm == "adjacency");
+    // Other alarms have the name of their reason. Reasons of the whole appliance differ by their subject,
+    // which is the alarm's source.
     const auto found = std::find_if(reasons.begin(), reasons.end(), [&](const reason &each) {
         return each.group == group && each.code == alarm && (group >= 0 || each.who == source);
     });

@@ -113,6 +113,7 @@ ctl_json json_failure(const ctl_failure &failure) {
 namespace {
 std::string text_failure(const ctl_failure &failure) {
     std::string out = "mgmtctl: ";
+    // Many refusals of mgmtd name the node themselves.
     if (!failure.node.empty() && !failure.error.starts_with(failure.node))
         out += failure.node + ": ";
     out += failure.error + "\n";
@@ -143,6 +144,7 @@ std::vector<ctl_alarm> alarms_of(const std::vector<ctl_binding> &bindings) {
         if (!parse_node_name(binding.name, &name) || !name.is_under(root))
             continue;
         const size_t depth = name.parts.size() - root.parts.size();
+        // TYPE/SOURCE, and below it what else is known of the alarm.
         if (depth < 2)
             continue;
         const std::string &type = name.parts[root.parts.size()];

@@ -82,6 +82,7 @@ void call_ready(const fdic_event_array *events, const std::vector<pollfd> &polle
     constexpr short broken = POLLERR | POLLHUP | POLLNVAL;
     for (uint32_t i = 0; i < polled.size(); i++) {
         const fdic_event *event = fdic_event_array_get_quick(events, i);
+        // After an error or a hang-up, the functions find the cause by reading or writing.
         if ((polled[i].revents & (POLLIN | broken)) && event->want_read && event->read_function)
             (void)event->read_function(event->fd, FDIC_READABLE, event->user_data, event->read_argument);
         if ((polled[i].revents & (POLLOUT | broken)) && event->want_write && event->write_function)
@@ -117,6 +118,8 @@ round run_round(ctl_session *self, int64_t deadline, int other_fd = -1) {
     std::vector<pollfd> polled(fdic_event_array_length_quick(events.pointer));
     for (uint32_t i = 0; i < polled.size(); i++) {
         const fdic_event *event = fdic_event_array_get_quick(events.pointer, i);
+        // poll ignores a negative descriptor. Timers therefore keep their places, and both lists stay
+        // parallel.
         polled[i].fd = event->has_fd ? event->fd : -1;
         polled[i].events =
             static_cast<short>((event->want_read ? POLLIN : 0) | (event->want_write ? POLLOUT : 0));
@@ -142,12 +145,15 @@ bool wait_for(ctl_session *self, const char *what, Done done, std::string *out_r
         if (!is_connected(self))
             return set_reason(out_reason, std::string("mgmtd closed the session ") + what);
         const round result = run_round(self, deadline);
+        // At the deadline; or poll itself has failed.
         if (result == round::over) {
             std::string seconds = std::to_string(self->timeout_ms / 1000);
             if (self->timeout_ms % 1000)
+                // The added 1000 keeps the zeros of the three digits; its own digit is cut off.
                 seconds += "." + std::to_string(self->timeout_ms % 1000 + 1000).substr(1);
             return set_reason(out_reason, "mgmtd gave no answer in " + seconds + " s");
         }
+        // Another signal, for example a change of the window's size, does not end the wait.
         if (result == round::interrupted && ctl_stop_signal)
             return set_reason(out_reason, "interrupted");
     }
@@ -189,11 +195,13 @@ const char *const ALLOWED = "only root, the user that mgmtd runs as and the grou
 // before that, to tell them apart.
 bool somebody_listens(std::string *out_reason) {
     const std::string path = provider_path();
+    // Other errors, such as a directory that may not be entered, are left to access().
     struct stat about = {};
     if (stat(path.c_str(), &about) != 0 && (errno == ENOENT || errno == ENOTDIR))
         return set_reason(out_reason, "mgmtd is not running (nothing listens at " + path + ")");
     if (access(path.c_str(), W_OK) != 0)
         return set_reason(out_reason, path + ": " + strerror(errno) + "; " + ALLOWED);
+    // Anybody can create the directory in /tmp before mgmtd does, and listen there.
     if (about.st_uid != 0 && about.st_uid != geteuid())
         return set_reason(out_reason, path + " belongs to user " + std::to_string(about.st_uid) +
                                           "; only root's mgmtd and our own user's are trusted");
@@ -221,6 +229,7 @@ bool connect_to_mgmtd(ctl_session *self, std::string *out_reason) {
     switch (gcl_session_client_connect_by_provider(self->session, "mgmtd", 0)) {
     case LC_OK:
         return true;
+    // The socket is there, but nobody listens: mgmtd was killed.
     case LC_IO_ERROR:
         return set_reason(out_reason, "mgmtd is not running (nothing listens at " + provider_path() + ")");
     default:
@@ -237,11 +246,13 @@ bool open_service(ctl_session *self, std::string *out_reason) {
     if (!wait_for(
             self, "before it was open", [&] { return stage() == GCL_ADMIN_GREETED; }, out_reason))
         return false;
+    // A service can be requested only after the greeting.
     if (gcl_session_client_open_service(self->session, BN_PROTO, SERVICE, nullptr, 0) != LC_OK ||
         !wait_for(
             self, "before it was open", [&] { return stage() == GCL_ADMIN_OPEN_ANSWERED; }, out_reason))
         return is_connected(self) ? false
                                   : set_reason(out_reason, "mgmtd closed the session before it was open");
+    // The answer may be a refusal.
     if (!gcl_session_service_is_open(self->session, SERVICE))
         return set_reason(out_reason, "mgmtd refuses its service to us");
     return true;
@@ -270,6 +281,7 @@ void ctl_close(ctl_session *session) {
 
 namespace {
 bool send_request(ctl_session *self, bn_request_msg *msg, ctl_reply *out, std::string *out_reason) {
+    // If the session is lost, the wait below reports that.
     if (bn_request_msg_send(self->session, msg) != LC_OK && is_connected(self))
         return set_reason(out_reason, "the request is too large for one message");
     self->awaited = msg->msg_id;
@@ -320,6 +332,7 @@ bn_binding *make_value(const ctl_binding &from) {
     if (!type_named(from.type, &type) ||
         bn_attrib_new_str(&fits.pointer, bn_attrib_value, type, 0, from.value.c_str()) != LC_OK)
         type = bn_type_str;
+    // `fits` was only a trial.
     return make_binding(from.name, {type, from.value});
 }
 
@@ -332,6 +345,7 @@ lc_status add_person(bn_request_msg *msg) {
 
 bool ctl_set(ctl_session *session, const std::vector<ctl_change_item> &items, const ctl_order &order,
              ctl_reply *out, std::string *out_reason) {
+    // In the order of ctl_change.
     static constexpr uint32_t subops[] = {bn_set_create, bn_set_modify, bn_set_delete, bn_set_reset};
     owned_request msg;
     const uint32_t flags = (order.check_only ? bn_cf_check_only : 0u) |
@@ -386,6 +400,7 @@ int ctl_next_event(ctl_session *session, int64_t wait_ms, ctl_event *out, std::s
             set_reason(out_reason, "mgmtd closed the session");
             return -1;
         }
+        // An event that came with the last round is delivered, although the time is over.
         if (run_round(session, deadline, other_fd) != round::ran && session->events.empty())
             return 0;
     }

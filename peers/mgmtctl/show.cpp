@@ -99,6 +99,7 @@ void take_screen(viewer *self, bool take) {
     if (self->on_screen == take || self->options.below > 0)
         return;
     self->on_screen = take;
+    // 1049 is the alternate screen, 25 the cursor.
     write_out(self, take ? "\033[?1049h\033[?25l" : "\033[0m\033[?25h\033[?1049l");
 }
 
@@ -115,6 +116,7 @@ std::string clock_text() {
 
 // Identifies a line that can disappear, whatever its text: a group or its proxy, an alarm or a note.
 std::string line_key(const std::string &line) {
+    // A subject that remains while its state changes: the key ends before the state.
     for (const char *kind : {"group ", "proxy of "})
         if (line.starts_with(kind))
             return line.substr(0, line.find("  "));
@@ -131,6 +133,7 @@ void print_changes(viewer *self, const snapshot &shown) {
         keys.push_back(line_key(line));
     std::string text;
     for (const std::string &line : self->before)
+        // Without mgmtd nothing is known to be gone. Lines without a key never are: "" is among the keys.
         if (shown.unreachable.empty() && missing(keys, line_key(line)))
             text += clock_text() + "  gone: " + line_key(line) + "\n";
     for (const std::string &line : now)
@@ -177,6 +180,8 @@ void show_screen(viewer *self, const snapshot &shown) {
         if (!self->options.watch)
             text += "\n";
         else
+            // Each line clears the rest of the old one, and the last one clears all below. It has no newline,
+            // which could scroll the screen.
             text += i + 1 < lines.size() ? "\033[K\r\n" : "\033[K\033[J";
     }
     write_out(self, text);
@@ -227,6 +232,7 @@ void pause_if_wanted(viewer *self) {
         return;
     pause_wanted = 0;
     take_screen(self, false);
+    // The program stops inside this call. After SIGCONT the next snapshot takes the screen again.
     raise(SIGSTOP);
 }
 
@@ -255,6 +261,7 @@ bool add_interests(ctl_session *session, std::string *out_reason) {
 // Waits until the next snapshot is due, after one that took this long. False: the session has ended.
 bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reason) {
     const int64_t began = lt_monotonic_ms();
+    // Gathering takes at most a fifth of the time.
     int64_t until = began + std::max(PERIOD_MS, 4 * cost_ms);
     while (!ctl_stop_signal && !pause_wanted) {
         ctl_event event;
@@ -264,6 +271,7 @@ bool wait_for_news(ctl_session *session, int64_t cost_ms, std::string *out_reaso
             return false;
         if (came == 0)
             return true;
+        // Not at once: further events of the same change arrive within this time.
         until = std::min(until, began + std::max(BURST_MS, cost_ms));
     }
     return true;
@@ -295,6 +303,7 @@ int watch_screen(viewer *self) {
             take_screen(self, true);
         self->how->show(self, shown);
         std::string reason;
+        // A query that failed leaves a session that cannot be used again.
         if (session && (!shown.unreachable.empty() || !wait_for_news(session, cost_ms, &reason))) {
             ctl_close(session);
             session = nullptr;
@@ -317,6 +326,7 @@ int ctl_show(const ctl_options &options) {
     self.terminal = isatty(STDOUT_FILENO) && kind && strcmp(kind, "dumb") != 0;
     self.how = std::find_if(std::begin(renderers), std::end(renderers),
                             [&](const renderer &each) { return each.is_wanted(self); });
+    // Or the character set would be ASCII, whatever the user's locale says.
     setlocale(LC_CTYPE, "");
     if (options.watch)
         return watch_screen(&self);

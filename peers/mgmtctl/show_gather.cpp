@@ -40,6 +40,7 @@ struct gathering {
         *out = {};
         if (query(walk, name, out, &reason))
             return true;
+        // Half a snapshot would look like a fault of the appliance. What was gathered so far is dropped.
         shown = {};
         shown.unreachable = reason.empty() ? "no answer" : clean_text(reason, 200);
         return false;
@@ -51,6 +52,7 @@ struct gathering {
             return true;
         if (!ask(walk, name, out))
             return false;
+        // The codes are mgmtd's: wccpd has no session, or has not answered mgmtd in time.
         if (out->code == LC_IO_CLOSED)
             shown.wccpd = wccpd_condition::absent;
         else if (out->code == LC_IO_TIMED_OUT)
@@ -100,6 +102,7 @@ const node_row<snapshot_router> router_rows[] = {
 const node_row<snapshot_group> group_rows[] = {
     {"oper",
      [](snapshot_group *g, const std::string &v) {
+         // "ACTIVE" or "ACTIVE, DESIGNATED"; a group that wccpd does not have has no such node.
          g->running = true;
          g->state = clean_text(v.substr(0, v.find(',')), 16);
          g->designated = v.ends_with(", DESIGNATED");
@@ -147,6 +150,7 @@ bool gather_reasons(gathering *work, const std::string &above, std::vector<snaps
         const std::vector<std::string> parts = parts_below(root, binding.name);
         if (parts.size() != 2)
             continue;
+        // The nodes of a reason follow one another: another number begins the next one.
         if (out->empty() || parts[0] != number) {
             if (out->size() >= REASONS_MAX)
                 break;
@@ -173,6 +177,7 @@ bool gather_config(gathering *work, snapshot_group *group, std::vector<std::stri
         const std::vector<std::string> parts = parts_below(root, binding.name);
         if (parts.size() == 1)
             take_node(config_rows, parts[0], binding.value, group);
+        // Half of the limit is reserved for routers that wccpd reports and nobody configured.
         else if (parts.size() == 3 && parts[0] == "router" && parts[2] == "ipaddr" &&
                  out_routers->size() < ROUTERS_MAX / 2)
             out_routers->push_back(clean_text(binding.value, 15));
@@ -186,10 +191,13 @@ void take_load(snapshot_group *group, snapshot_router *router, const std::string
         return;
     const snapshot_load load = {clean_text(address, 15), number_of<uint32_t>(value, 0)};
     router->loads.push_back(load);
+    // The router's list may have more appliances than a group can have here; then only its own record gets
+    // the load.
     const int place = place_of_appliance(group, load.appliance);
     if (place < 0)
         return;
     snapshot_appliance *one = &group->appliances[static_cast<size_t>(place)];
+    // Before the first report the minimum is 0, which min() would keep.
     one->least_percent = one->reported ? std::min(one->least_percent, load.percent) : load.percent;
     one->most_percent = std::max(one->most_percent, load.percent);
     one->reported = true;
@@ -197,6 +205,7 @@ void take_load(snapshot_group *group, snapshot_router *router, const std::string
 
 uint32_t address_order(const std::string &address) {
     in_addr parsed = {};
+    // In host order, because network order would sort by the last byte on a little-endian machine.
     return inet_pton(AF_INET, address.c_str(), &parsed) == 1 ? ntohl(parsed.s_addr) : 0;
 }
 
@@ -208,6 +217,7 @@ bool gather_routers(gathering *work, snapshot_group *group, const std::vector<st
     std::string number;
     for (const ctl_binding &binding : reply.bindings) {
         const std::vector<std::string> parts = parts_below(root, binding.name);
+        // N/NODE, or N/appliance/ADDRESS/load_dist.
         if (parts.size() != 2 && !(parts.size() == 4 && parts[1] == "appliance"))
             continue;
         if (group->routers.empty() || parts[0] != number) {
@@ -229,7 +239,8 @@ bool gather_routers(gathering *work, snapshot_group *group, const std::vector<st
         const auto heard =
             std::find_if(group->routers.begin(), group->routers.end(),
                          [&](const snapshot_router &r) { return r.address == address || r.id == address; });
-        // A multicast address serves to find routers and is not a router itself.
+        // A multicast address (224 and above in the first byte) serves to find routers and is not a router
+        // itself. It is listed only until a router has answered it.
         if (heard != group->routers.end()) {
             heard->configured = true;
         } else if (const int first = number_of(address, 0); first < 224 || group->routers.empty()) {
@@ -251,6 +262,8 @@ bool gather_weights(gathering *work, snapshot_group *group, uint32_t count) {
     if (!query_appliances(ask, group_root(NODE_GROUP_STATE, group->id) + "/appliance", count, &found))
         return false;
     for (size_t i = 0; i + 1 < found.size(); i++) {
+        // Normally pairs of address and weight. An appliance that vanished between its two queries leaves one
+        // of them; a step of one finds the next pair all the same.
         const ctl_binding &address = found[i], &weight = found[i + 1];
         if (!address.name.ends_with("/ipaddr") || !weight.name.ends_with("/weight") ||
             address.value == "0.0.0.0")
@@ -272,6 +285,7 @@ void finish_shares(snapshot_group *group) {
     }
     for (snapshot_appliance &one : group->appliances)
         if (known && sum > 0)
+            // Rounded to the nearest percent.
             one.asked_percent = static_cast<int>((one.weight * 100 + sum / 2) / sum);
 }
 
@@ -282,6 +296,7 @@ void sort_appliances(snapshot_group *group) {
         return address_order(a.address) < address_order(b.address);
     });
     group->appliances.swap(sorted);
+    // `sorted` now has the old order, to whose places the tables refer.
     const auto renumber = [&](snapshot_table *table) {
         for (int &owner : table->owners)
             if (owner >= 0)
@@ -321,6 +336,7 @@ bool gather_briefly(gathering *work, snapshot_group *group, const std::string &r
             return false;
         take_group_nodes(root, reply, group, &unused);
     }
+    // Without a router there is no share to ask for.
     if (group->routers_heard == 0)
         return true;
     if (!work->ask_wccpd(ctl_walk::node, root + "/router/1/appliance/" + group->address + "/load_dist",
@@ -336,6 +352,7 @@ bool gather_briefly(gathering *work, snapshot_group *group, const std::string &r
 // The number of Here-I-Am sent, if a router does not answer.
 bool gather_sent(gathering *work, snapshot_group *group, const std::string &root) {
     ctl_reply reply;
+    // The count is of interest only beside a router that gives no answer.
     const bool silent =
         std::any_of(group->routers.begin(), group->routers.end(),
                     [](const snapshot_router &router) { return router.connection == "none"; });
@@ -376,6 +393,8 @@ bool gather_group(gathering *work, snapshot_group *group, bool in_wccpd) {
     if (!gather_routers(work, group, configured) || !gather_weights(work, group, texts.appliances) ||
         (in_wccpd && !gather_reasons(work, root, &group->reasons)) || !gather_sent(work, group, root))
         return false;
+    // The text has the designated appliance's allotment; finish_shares() fills in what it leaves unknown.
+    // Sorting renumbers the owners in all tables, and has to be last.
     take_group_text(texts.group, group);
     take_assignment_text(texts.assignment, group);
     drop_misread_tables(group);
@@ -413,6 +432,7 @@ bool gather_alarms(gathering *work) {
     work->shown.alarms_total = active_alarms.size();
     for (size_t i = 0; i < std::min(active_alarms.size(), work->limits.alarms); i++) {
         const ctl_alarm &from = active_alarms[i];
+        // The source of a group's alarm ends with ":grp:" and its number.
         const size_t at = from.source.rfind(":grp:");
         work->shown.alarms.push_back(
             {number_of<long>(from.type, 0), clean_text(from.name, 31), clean_text(from.source, 63),
@@ -456,7 +476,9 @@ void add_ids(const char *root, const ctl_reply &reply, std::vector<int> *inout) 
 
 void gather_all(gathering *work) {
     ctl_reply alive, version, mode, states, configs;
+    // Assumed until a query fails, because ask_wccpd() asks nothing of a wccpd that is not running.
     work->shown.wccpd = wccpd_condition::running;
+    // mgmtd's own nodes come first: they are shown without wccpd as well.
     if (!work->ask(ctl_walk::node, NODE_SYSTEM_MODE, &mode) || !gather_alarms(work) ||
         !gather_redirected(work) || !work->ask(ctl_walk::children, NODE_GROUP_CONFIG, &configs) ||
         !work->ask_wccpd(ctl_walk::node, NODE_WCCPD_STATUS, &alive) ||
@@ -477,6 +499,7 @@ void gather_all(gathering *work) {
     work->shown.groups_total = all.size();
     work->shown.brief = all.size() > work->limits.detailed;
     for (const int id : all) {
+        // The groups that are left out are counted in groups_total.
         if (work->queries >= work->limits.queries ||
             (work->shown.brief && work->shown.groups.size() >= work->limits.listed))
             return;

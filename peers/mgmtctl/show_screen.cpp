@@ -87,6 +87,7 @@ std::string alarm_words(const snapshot_alarm &alarm, const std::vector<reason> &
     const time_t now = time(nullptr);
     tm parts;
     strftime(today, sizeof today, "%Y/%m/%d ", localtime_r(&now, &parts));
+    // The date is shown only if it is not today's.
     const std::string since =
         alarm.since.starts_with(today) ? alarm.since.substr(strlen(today)) : alarm.since;
     return since.empty() ? text : text + ", since " + since;
@@ -163,6 +164,7 @@ struct screen {
             line->used = 0;
             add_cells(line, "    ");
         }
+        // No gap after the first four columns, which are a number or an indentation.
         add_cells(line, line->used > 4 ? "  " : "");
         add_cells(line, words, how);
     }
@@ -171,6 +173,7 @@ struct screen {
         const auto room = static_cast<size_t>(form.columns);
         while (words.size() > room) {
             const size_t blank = words.rfind(' ', room);
+            // A break at column 8 or later removes more than the indentation adds: the loop ends.
             if (blank == std::string::npos || blank < 8)
                 break;
             text(words.substr(0, blank), how);
@@ -200,6 +203,7 @@ void draw_head(screen *on, size_t alarms_most) {
                                                   : "alarms unknown";
     const std::string version = shown.version.empty() ? "" : " (" + shown.version + ")";
     add_cells(&line, status, running ? style::bold : style::bad);
+    // The version is the first to go when the line is too short.
     if ((status + version + counts + alarms + on->form.corner).size() <=
         static_cast<size_t>(on->form.columns))
         add_cells(&line, version);
@@ -268,11 +272,13 @@ void draw_router(screen *on, const snapshot_group &group, const snapshot_router 
 
 void draw_bar(pen *line, const snapshot_appliance &one, int place) {
     const int cells = std::clamp(line->form.columns - line->used, 0, BAR_CELLS);
+    // In hundredths of a cell.
     const int has = static_cast<int>(std::min<uint32_t>(one.least_percent, 100)) * cells;
     const int asked = std::clamp(one.asked_percent, 0, 100) * cells;
     set_style(line, "38;5;" + std::to_string(colour_of(place)));
     for (int i = 0; i < cells; i++) {
         const int middle = i * 100 + 50; // of the cell, in hundredths
+        // Solid up to the smaller of the two shares; then the surplus, or what is missing.
         if (middle <= has && (middle <= asked || one.asked_percent < 0))
             add_glyph(line, "█", '#');
         else if (middle <= has)
@@ -296,6 +302,7 @@ void draw_appliance(screen *on, const snapshot_appliance &one, int place) {
               one.weight < 0 ? format_text("%-13s", "") : format_text("weight %-6" PRId64, one.weight));
     add_cells(&line, one.asked_percent < 0 ? format_text("%-11s", "")
                                            : format_text("asked %3d%% ", one.asked_percent));
+    // A difference of 1 % is rounding.
     const bool short_of = one.reported && one.asked_percent >= 0 &&
                           std::abs(static_cast<int>(one.least_percent) - one.asked_percent) > 1;
     add_cells(&line, format_text("has %-7s ", share_words(one).c_str()),
@@ -311,12 +318,15 @@ void draw_strip(screen *on, const snapshot_group &group, const snapshot_table &t
     pen line = on->begin();
     add_cells(&line, "  " + label + " ");
     const int cells = std::clamp(on->form.columns - line.used, 0, STRIP_CELLS);
+    // Scales the table to the half cells of the line; a table has up to 256 places, the line up to 128.
     const auto owner_at = [&](int half) {
         return table.owners[static_cast<size_t>(half) * table.owners.size() / static_cast<size_t>(2 * cells)];
     };
     std::string before;
     for (int i = 0; i < cells; i++) {
         const int left = owner_at(2 * i), right = owner_at(2 * i + 1);
+        // The half block paints the left owner in the foreground; the right one is the background. Without
+        // UTF-8 the cell has one owner's colour and letter.
         const std::string codes = (on->form.utf8 ? "38;5;" + std::to_string(colour_of(left)) : "30") +
                                   ";48;5;" + std::to_string(colour_of(on->form.utf8 ? right : left));
         if (codes != before)
@@ -339,6 +349,7 @@ std::vector<size_t> choose_rows(const std::vector<Entry> &all, size_t most, Firs
         for (size_t i = 0; i < all.size() && out.size() < most; i++)
             if (first(all[i]) == wanted)
                 out.push_back(i);
+    // All fit: their own order is easier to follow.
     if (out.size() == all.size())
         std::sort(out.begin(), out.end());
     return out;
@@ -438,6 +449,7 @@ std::vector<std::string> draw_briefly(const snapshot &shown, const screen_form &
 
 std::vector<std::string> draw_screen(const snapshot &shown, const screen_form &form) {
     if (!shown.brief)
+        // Fewer and fewer rows of each list, until the screen fits.
         for (const size_t most : {size_t{256}, size_t{16}, size_t{8}, size_t{4}, size_t{2}, size_t{1}}) {
             std::vector<std::string> lines = draw_whole(shown, form, most);
             if (form.rows <= 0 || lines.size() <= static_cast<size_t>(form.rows))

@@ -74,6 +74,7 @@ void put_words(assignment_reader *in, const uint32_t *words) {
     table->mask = in->mask;
     table->owners.resize(BUCKETS, -1);
     for (size_t i = 0; i < 128; i++) {
+        // The order of bits is described at the top of this file.
         const size_t shift = in->mask ? i % 32 : (3 - i / 8 % 4) * 8 + i % 8;
         if (words[i / 32] >> shift & 1)
             table->owners[static_cast<size_t>(in->words_at) * 32 + i] = in->place;
@@ -83,6 +84,7 @@ void put_words(assignment_reader *in, const uint32_t *words) {
 void put_wanted_words(assignment_reader *in, const uint32_t *words) {
     in->group->wanted.owners.resize(BUCKETS, -1);
     for (size_t i = 0; i < 128; i++)
+        // Here the words come in reverse.
         if (words[3 - i / 32] >> i % 32 & 1)
             in->group->wanted.owners[static_cast<size_t>(in->wanted_at) + i] = in->place;
 }
@@ -106,6 +108,7 @@ void take_row(assignment_reader *in, const dump_row &row) {
     uint32_t words[4];
     if (take_wanted_value(in, row))
         return;
+    // A line without a label continues the table of the lines before it.
     if (in->wanted_at >= 0 && row.label.empty() && words_in(row.value, words)) {
         put_wanted_words(in, words);
         in->wanted_at -= 128;
@@ -122,12 +125,14 @@ void take_row(assignment_reader *in, const dump_row &row) {
     } else if (row.label == "Hash/mask allotment" && !in->routers && in->place >= 0) {
         in->group->appliances[static_cast<size_t>(in->place)].asked_percent =
             std::clamp(atoi(std::string(row.value.substr(0, 8)).c_str()), 0, 100);
+        // The line with the upper 128 buckets comes next, then that with the lower ones.
         in->wanted_at = 128;
     } else if (row.label == "Rxed hash assignment" || row.label.starts_with("Rxed value buckets")) {
         in->mask = row.label.starts_with("Rxed value");
         in->words_at = 0;
         if (words_in(row.value, words))
             put_words(in, words);
+        // 256 buckets take two lines of four words, 128 mask values one.
         in->words_at = in->mask ? -1 : 4;
     }
 }
@@ -164,6 +169,7 @@ void take_assignment_text(const std::string &text, snapshot_group *inout) {
         finish_table(inout->wanted, &table);
         if (!has_owner(table))
             continue;
+        // Routers with equal tables share an entry.
         auto same = std::find_if(inout->tables.begin(), inout->tables.end(), [&](const snapshot_table &t) {
             return t.mask == table.mask && t.owners == table.owners;
         });
@@ -179,6 +185,7 @@ void take_group_text(const std::string &text, snapshot_group *inout) {
         if (!first)
             return;
         const std::string value(row.value.substr(0, 64));
+        // The configuration has precedence; wccpd's text fills in for a group that is not configured.
         if (row.label == "WCCP interfaces" && inout->interface.empty()) {
             const size_t name = value.rfind(' ');
             if (name != std::string::npos && name > 2) // "# 1 eth0"; without a name there is none

@@ -26,6 +26,7 @@ std::string share_words(const snapshot_appliance &one) {
     if (!one.reported)
         return "-";
     std::string text = std::to_string(one.least_percent);
+    // Routers that give it different shares: "20-40%".
     if (one.most_percent != one.least_percent)
         text += "-" + std::to_string(one.most_percent);
     return text + "%";
@@ -44,6 +45,7 @@ size_t connected_routers(const snapshot_group &group) {
 
 std::string group_counts(const snapshot &shown) {
     size_t active = shown.roles_active, backup = shown.roles_backup;
+    // A brief snapshot may not have all groups; mgmtd knows all roles.
     if (!shown.brief) {
         active = backup = 0;
         for (const snapshot_group &group : shown.groups) {

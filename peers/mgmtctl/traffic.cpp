@@ -124,6 +124,7 @@ Entry *entry_of(std::vector<Entry> *inout, int Entry::*id, const std::string &pa
 void take_occurrence(const std::vector<std::string> &parts, const std::string &value,
                      std::map<std::string, int64_t> *inout) {
     std::string what = parts[1];
+    // For example "refused_source/10.0.0.9"; other occurrences have one part.
     for (size_t i = 2; i < parts.size(); i++)
         what += "/" + parts[i];
     if (inout->size() < ENTRIES_MAX)
@@ -186,6 +187,7 @@ void take_accepted(const std::vector<std::string> &parts, const std::string &val
     if (out->accepted.size() >= ENTRIES_MAX)
         return;
     std::string *router = &out->accepted[clean_text(parts[0], 15)];
+    // The default 0.0.0.0 means beside any router.
     if (parts.size() == 2 && parts[1] == "router" && value != "0.0.0.0")
         *router = clean_text(value, 15);
 }
@@ -226,6 +228,7 @@ bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
         bool of_tunneld;
         void (*take)(const std::vector<std::string> &parts, const std::string &value, traffic_state *out);
     } walks[] = {
+        // First, because the other walks of tunneld are skipped when this one shows that it is not running.
         {NODE_PLANE_STATE, true, take_plane},
         {NODE_TUNNEL_STATE, true, take_tunnel},
         {NODE_INTERCEPT_STATE, true, take_intercept},
@@ -235,6 +238,7 @@ bool gather_traffic(const ctl_ask &ask, traffic_state *out) {
         {NODE_DRAINS, false, take_drained},
     };
     *out = {};
+    // Assumed until an answer of tunneld is missing.
     out->tunneld = tunneld_condition::running;
     for (const auto &walk : walks) {
         ctl_reply reply;
@@ -266,9 +270,11 @@ std::string count_text(uint64_t count) {
         return std::to_string(count);
     auto shown = static_cast<double>(count);
     size_t unit = 0;
+    // From 999.5 on, "%.0f" would print 1000 of this unit.
     for (shown /= 1000; shown >= 999.5; shown /= 1000)
         unit++;
     char text[16];
+    // From 9.95 on, "%.1f" would print 10.0.
     snprintf(text, sizeof text, shown < 9.95 ? "%.1f%c" : "%.0f%c", shown, units[unit]);
     return text;
 }
@@ -332,6 +338,7 @@ int64_t age_of(const std::map<std::string, int64_t> &ages, const std::string &wh
 void add_counted(const traffic_state &state, const reason_list &list, const std::string &what,
                  uint64_t packets, const std::string &text, const std::string &who = "") {
     const int64_t last = age_of(state.last_ms, what);
+    // A counter keeps its value. Only the age of the last packet tells whether the cause still exists.
     if (packets == 0 || last > OVER_MS)
         return;
     traffic_reason *made = list.add_reason(text);
@@ -347,6 +354,7 @@ void find_own_traffic(const traffic_state &state, const reason_list &list) {
 
 void find_refused_sources(const traffic_state &state, const reason_list &list) {
     for (const auto &[address, packets] : state.refused_sources)
+        // Its packets were counted before it was accepted.
         if (!state.accepted.contains(address))
             add_counted(state, list, "refused_source/" + address, packets,
                         "refused source " + address + ": mgmtctl tunnel accept " + address, address);
@@ -421,6 +429,7 @@ void find_slow_starts(const traffic_state &state, const reason_list &list) {
 
 void find_proxies_down(const traffic_state &state, const reason_list &list) {
     for (const traffic_intercept &each : state.intercepts)
+        // A group that has left because of its proxy has that in its reason "left".
         if (each.proxy == "down" && !state.left.contains(each.group))
             list.add_reason("group " + std::to_string(each.group) + ": the proxy is down" +
                                 (each.proxy_reason.empty() ? "" : ": ") + each.proxy_reason,
@@ -437,6 +446,7 @@ void find_standing_by(const traffic_state &state, const reason_list &list) {
 
 void find_unprotected(const traffic_state &state, const reason_list &list) {
     for (const protected_group &each : state.protection.groups)
+        // With the time 0 protection is switched off on purpose.
         if (!each.covered && state.protection.time != 0)
             list.add_reason("group " + std::to_string(each.group) + " is unprotected: " + each.reason,
                             each.group)
@@ -464,6 +474,7 @@ std::vector<traffic_reason> traffic_reasons(const traffic_state &state) {
     };
     std::vector<traffic_reason> out;
     for (const auto &row : rows)
+        // In the order of the rows, which is the order of the output.
         row.find(state, {row.word, &out});
     for (traffic_reason &each : out) // the codes of reasons have hyphens
         std::replace(each.word.begin(), each.word.end(), '_', '-');

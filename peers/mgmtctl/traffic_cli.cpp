@@ -86,6 +86,7 @@ struct traffic_queries {
             const std::vector<std::string> parts = parts_below(root, binding.name);
             if (parts.empty() || parts.size() > 2)
                 continue;
+            // Nodes of one instance follow one another.
             if (out->empty() || out->back().first != parts[0])
                 out->push_back({parts[0], {}});
             if (parts.size() == 2)

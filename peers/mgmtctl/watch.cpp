@@ -45,6 +45,7 @@ std::vector<change_entry> changes_of(const ctl_event &event) {
     std::map<node_name, change_entry> entries;
     for (const ctl_binding &binding : event.bindings) {
         node_name name;
+        // The names are EVENT_CHANGES, which has three parts, the number, and what the binding is.
         if (!parse_node_name(binding.name, &name) || name.parts.size() < 4)
             continue;
         const std::string what = name.parts.size() == 4 ? "" : name.parts[4];
@@ -223,6 +224,7 @@ std::vector<std::string> text_event(const ctl_event &event, bool secrets) {
     if (event.name == EVENT_CONFIG_CHANGE) {
         std::vector<std::string> out;
         for (const change_entry &entry : changes_of(event)) {
+            // As wide as "delete" and "modify".
             std::string line = entry.kind + std::string(entry.kind == "add" ? "    " : " ") + entry.name;
             if (!entry.after.type.empty())
                 line += " = " + shown_value(entry.after, secrets);
@@ -285,6 +287,7 @@ int follow_events(const ctl_options &options, ctl_session *session, const std::v
         patterns.push_back(watch_pattern(name));
     std::string reason;
     for (const std::string &event : watched_events()) {
+        // The first event is the only one that has names.
         if (event != EVENT_CONFIG_CHANGE && !names.empty())
             break;
         if (!ctl_add_interest(session, event, patterns, &reason))
