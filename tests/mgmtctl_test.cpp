@@ -12,7 +12,6 @@
 #include <thread>
 
 #include <gtest/gtest.h>
-#include <nlohmann/json.hpp>
 
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/check.h"
@@ -86,10 +85,11 @@ TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
     EXPECT_EQ(text_event(change, false), (strings{"modify " + G51 + "/password = ******** (was ********)",
                                                   "delete " + G51 + "/policy_grp (was 3)"}));
     const ctl_json told = json_event(change, true);
-    EXPECT_EQ(told["changes"][0]["after"], "neu");
-    EXPECT_EQ(json_line(told["changes"][1]), "{\"name\":\"" + G51 +
-                                                 "/policy_grp\",\"change\":\"delete\",\"type\":\"uint32\","
-                                                 "\"before\":3,\"after\":null}\n");
+    EXPECT_EQ(told["changes"].items[0]["after"].text, "neu");
+    EXPECT_EQ(json_line(told["changes"].items[1]),
+              "{\"name\":\"" + G51 +
+                  "/policy_grp\",\"change\":\"delete\",\"type\":\"uint32\","
+                  "\"before\":3,\"after\":null}\n");
 }
 
 // --- Changes
@@ -160,7 +160,7 @@ TEST(Changes, AWholeConfigurationIsItsDifference) {
         // What is exported reads the same, with the passwords and without.
         for (const bool secrets : {false, true})
             for (const std::string &text :
-                 {export_text({made, {}, {}, ""}, secrets), export_json(made, secrets).dump()}) {
+                 {export_text({made, {}, {}, ""}, secrets), json_line(export_json(made, secrets))}) {
                 node_tree again;
                 ASSERT_TRUE(read_config(text, "F", made, false, &again, &errors)) << text << errors;
                 EXPECT_EQ(again.set, made.set) << text;

@@ -3,8 +3,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
-
-#include <nlohmann/json.hpp>
+#include <utility>
 
 #include "peers/mgmtctl/check_firewall.h"
 #include "peers/mgmtctl/render.h"
@@ -194,7 +193,7 @@ void judge_forwarding(judging *work) {
     });
 }
 
-void judge_packets(judging *work, const nlohmann::json &rules, const check_group &group) {
+void judge_packets(judging *work, const ctl_json &rules, const check_group &group) {
     for (const bool gre : {false, true})
         for (const bool outgoing : {false, true}) {
             // Such a group is redirected without GRE.
@@ -223,10 +222,11 @@ void judge_firewall(judging *work) {
                              "), which this cannot read: look through iptables-legacy-save");
     if (!facts.filter_error.empty())
         return work->note_unchecked("the rules cannot be read: " + facts.filter_error);
-    const nlohmann::json listing = nlohmann::json::parse(facts.filter_listing, nullptr, false);
-    if (!listing.is_object() || !listing.contains("nftables") || !listing["nftables"].is_array())
+    ctl_json listing;
+    const bool readable = parse_json(facts.filter_listing, &listing);
+    const ctl_json &rules = std::as_const(listing)["nftables"];
+    if (!readable || !rules.is_array())
         return work->note_unchecked("the rules cannot be read: their listing is not understood");
-    const nlohmann::json &rules = listing["nftables"];
     if (!facts.mgmtd_error.empty())
         return judge_packets(work, rules, {-1, "", true, "either"});
     for (const check_group &group : facts.groups)

@@ -7,8 +7,6 @@
 #include <string>
 #include <vector>
 
-#include <nlohmann/json_fwd.hpp>
-
 #include "peers/mgmtctl/link.h"
 #include "peers/mgmtctl/reasons.h"
 

@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include <nlohmann/json_fwd.hpp>
+#include "peers/mgmtctl/ctl_json.h"
 
 // A first packet between router and appliance: UDP from and to port 2048, or GRE.
 struct filtered_packet {
@@ -19,4 +19,4 @@ struct filter_finding {
 // `objects`: the array "nftables" of "nft --json list ruleset". A condition that is not understood, or that
 // depends on more than the packet above, makes the result unclear if it could change the verdict. tunneld's
 // own table is left out.
-filter_finding judge_packet(const nlohmann::json &objects, const filtered_packet &packet);
+filter_finding judge_packet(const ctl_json &objects, const filtered_packet &packet);

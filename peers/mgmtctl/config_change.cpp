@@ -7,8 +7,6 @@
 
 #include <set>
 
-#include <nlohmann/json.hpp>
-
 #include "peers/nodes/secrets.h"
 
 namespace {
@@ -18,21 +16,15 @@ ctl_binding shown_binding(const node_name &name, const node_value &value) {
 
 // --- Reading
 
-// The parser keeps one of two equal names; the callback detects them.
-bool parse_json(const std::string &content, ctl_json *out, std::string *out_reason) {
-    std::set<std::string> names;
-    std::string twice;
-    const auto look = [&](int depth, ctl_json::parse_event_t event, ctl_json &parsed) {
-        if (event == ctl_json::parse_event_t::key && depth == 1 &&
-            !names.insert(parsed.get<std::string>()).second)
-            twice = parsed.get<std::string>();
-        return depth <= 1;
-    };
-    *out = ctl_json::parse(content, look, false);
-    if (out->is_discarded() || !out->is_object())
+bool parse_json_nodes(const std::string &content, ctl_json *out, std::string *out_reason) {
+    if (!parse_json(content, out) || !out->is_object()) {
         *out_reason = "is not a JSON object of nodes and their values";
-    else if (!twice.empty())
-        *out_reason = shown_text(twice) + ": is given twice";
+        return false;
+    }
+    std::set<std::string> names;
+    for (const std::string &name : out->names)
+        if (!names.insert(name).second)
+            *out_reason = shown_text(name) + ": is given twice";
     return out_reason->empty();
 }
 
@@ -44,11 +36,9 @@ bool take_json_node(node_tree *tree, const std::string &text, const ctl_json &va
         *out_reason = "there is no such node in the configuration";
         return false;
     }
-    const std::string given = value.is_string() ? value.get<std::string>()
-                              : value.is_null() ? ""
-                                                : value.dump();
+    const std::string given = value.is_text() || value.is_null() ? value.text : json_text(value);
     std::string kept;
-    if (value.is_structured() || (value.is_null() && !row->instance))
+    if (value.is_array() || value.is_object() || (value.is_null() && !row->instance))
         *out_reason = "the value is neither a text nor a number nor true or false";
     else if (check_value(*row, name, given, &kept, out_reason)) {
         for (const node_name &instance : instances_of(name))
@@ -62,15 +52,15 @@ bool take_json_node(node_tree *tree, const std::string &text, const ctl_json &va
 bool read_json(const std::string &content, const std::string &file, node_tree *out, std::string *out_errors) {
     ctl_json nodes;
     std::string reason;
-    if (!parse_json(content, &nodes, &reason)) {
+    if (!parse_json_nodes(content, &nodes, &reason)) {
         *out_errors = file + ": " + reason + "\n";
         return false;
     }
-    for (const auto &[name, value] : nodes.items())
-        if (reason.clear(); !take_json_node(out, name, value, &reason))
+    for (size_t i = 0; i < nodes.items.size(); i++)
+        if (reason.clear(); !take_json_node(out, nodes.names[i], nodes.items[i], &reason))
             out_errors->append(file)
                 .append(": ")
-                .append(shown_text(name))
+                .append(shown_text(nodes.names[i]))
                 .append(": ")
                 .append(reason)
                 .append("\n");

@@ -10,7 +10,6 @@
 #include <ctime>
 
 #include <fcntl.h>
-#include <nlohmann/json.hpp>
 #include <unistd.h>
 
 #include "mgmt/node_paths.h"
@@ -229,9 +228,7 @@ int ctl_export(const ctl_options &options) {
     uint32_t revision = 0;
     if (!get_present(&mgmtd, &present, &revision))
         return mgmtd.code;
-    write_output(options.json ? export_json(present.tree, options.secrets)
-                                        .dump(2, ' ', true, ctl_json::error_handler_t::replace) +
-                                    "\n"
+    write_output(options.json ? json_text(export_json(present.tree, options.secrets), 2) + "\n"
                               : export_text(present, options.secrets));
     return CTL_OK;
 }

@@ -4,8 +4,6 @@
 #include <charconv>
 #include <ctime>
 
-#include <nlohmann/json.hpp>
-
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/group_words.h"
 #include "peers/mgmtctl/intercepts.h"

@@ -1,8 +1,6 @@
 // "mgmtctl explain": each reason with its cause, its time and the next step.
 #include <algorithm>
 
-#include <nlohmann/json.hpp>
-
 #include "peers/mgmtctl/link.h"
 #include "peers/mgmtctl/reasons.h"
 #include "peers/mgmtctl/render.h"

@@ -2,7 +2,6 @@
 #include <cstdio>
 #include <map>
 
-#include <nlohmann/json.hpp>
 #include <termios.h>
 #include <unistd.h>
 

@@ -1,8 +1,6 @@
 // The commands about nodes: "get", "walk", "set", "delete", "alarms", and the shell's completion.
 #include <cstdio>
 
-#include <nlohmann/json.hpp>
-
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/connection.h"
 #include "peers/mgmtctl/nodes.h"

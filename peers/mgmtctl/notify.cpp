@@ -21,7 +21,6 @@
 
 #include <fcntl.h>
 #include <grp.h>
-#include <nlohmann/json.hpp>
 #include <poll.h>
 #include <pwd.h>
 #include <sys/stat.h>

@@ -10,7 +10,6 @@
 #include <algorithm>
 #include <cstdio>
 
-#include <nlohmann/json.hpp>
 #include <unistd.h>
 
 #include "mgmt/node_paths.h"
@@ -36,7 +35,7 @@ void write_output(const std::string &text) {
 }
 
 std::string json_line(const ctl_json &value) {
-    return value.dump(-1, ' ', true, ctl_json::error_handler_t::replace) + "\n";
+    return json_text(value) + "\n";
 }
 
 // --- Nodes
@@ -59,8 +58,8 @@ ctl_json json_value(const ctl_binding &binding) {
     }
     if (!bn_type_numeric(type))
         return text;
-    const ctl_json number = ctl_json::parse(text, nullptr, false);
-    return number.is_number() ? number : ctl_json(text);
+    ctl_json number;
+    return parse_json(text, &number) && number.is_number() ? number : ctl_json(text);
 }
 
 ctl_json json_node(const ctl_binding &binding, bool secrets) {

@@ -4,11 +4,8 @@
 #include <string>
 #include <vector>
 
-#include <nlohmann/json_fwd.hpp>
-
 #include "peers/mgmtctl/commands.h"
-
-using ctl_json = nlohmann::ordered_json; // complete only where nlohmann/json.hpp is included
+#include "peers/mgmtctl/ctl_json.h"
 
 // To standard output; a failed write is reported at the end of the program.
 void write_output(const std::string &text);

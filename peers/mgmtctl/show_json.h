@@ -1,11 +1,11 @@
 // What "show" and "explain" have in common for scripts.
 #pragma once
 
-#include <nlohmann/json_fwd.hpp>
+#include "peers/mgmtctl/ctl_json.h"
 
 #include "peers/mgmtctl/commands.h"
 #include "peers/mgmtctl/reasons.h"
 
-nlohmann::ordered_json reason_json(const reason &one);
+ctl_json reason_json(const reason &one);
 // What "explain" prints of a snapshot, and its exit code. `group` -1: all of it.
 int tell_reasons(const ctl_options &options, const snapshot &shown, int group);

@@ -3,8 +3,6 @@
 #include <ctime>
 #include <map>
 
-#include <nlohmann/json.hpp>
-
 #include "mgmt/bnode_types.h"
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/group_words.h"

@@ -1,10 +1,15 @@
 #include "peers/mgmtctl/traffic_json.h"
 
-#include <nlohmann/json.hpp>
-
 namespace {
 ctl_json text_or_null(const std::string &text) {
     return text.empty() ? ctl_json(nullptr) : ctl_json(text);
+}
+
+ctl_json packets_json(const std::map<std::string, uint64_t> &packets) {
+    ctl_json out = ctl_json::object();
+    for (const auto &[name, count] : packets)
+        out[name] = count;
+    return out;
 }
 
 ctl_json count_json(const traffic_count &count) {
@@ -28,7 +33,7 @@ ctl_json tunnel_json(const traffic_tunnel &tunnel) {
             {"in", count_json(tunnel.in)},
             {"out", count_json(tunnel.out)},
             {"fragments", tunnel.fragments},
-            {"refused", tunnel.refused},
+            {"refused", packets_json(tunnel.refused)},
             {"sorted", sorted_json(tunnel.sorted)}};
 }
 } // namespace
@@ -82,7 +87,7 @@ ctl_json protection_json(const protection_state &state) {
     out["members"] = ctl_json::array();
     for (const auto &[address, counts] : state.members) {
         out["members"].push_back(protection_counts_json(counts));
-        out["members"].back()["address"] = address;
+        out["members"].items.back()["address"] = address;
     }
     return out;
 }
@@ -95,8 +100,8 @@ ctl_json traffic_json(const traffic_state &state) {
                     {"lack", text_or_null(state.lack)},
                     {"failure", text_or_null(state.failure)},
                     {"clamped", running ? ctl_json(state.clamped) : ctl_json(nullptr)},
-                    {"refused", state.refused},
-                    {"refused_sources", state.refused_sources},
+                    {"refused", packets_json(state.refused)},
+                    {"refused_sources", packets_json(state.refused_sources)},
                     {"tunnels", ctl_json::array()},
                     {"intercepts", ctl_json::array()},
                     {"protection", running ? protection_json(state.protection) : ctl_json(nullptr)},

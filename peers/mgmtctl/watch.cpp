@@ -11,7 +11,6 @@
 #include <ctime>
 #include <map>
 
-#include <nlohmann/json.hpp>
 #include <poll.h>
 #include <unistd.h>
 
