@@ -172,7 +172,7 @@ struct Commands : testing::Test {
         return {find_notify_commands(directory).paths,
                 {"WCCP_KIND=role"},
                 limit_ms,
-                300,
+                100,
                 [this](const std::string &line) { said += line + "\n"; }};
     }
 };
@@ -180,7 +180,7 @@ struct Commands : testing::Test {
 TEST_F(Commands, RunOneAfterTheOtherWithAllTheirChildren) {
     setenv("WCCP_STALE", "1", 1);
     setenv("OPERATOR", "yes", 1);
-    add("10-first", "echo first >>log; (sleep 0.3; echo late >>log) & exit 3\n");
+    add("10-first", "echo first >>log; (sleep 0.1; echo late >>log) & exit 3\n");
     add("20-second", "echo second $WCCP_KIND $WCCP_STALE $OPERATOR >>log; read x || echo no input >>log; ls "
                      "/proc/self/fd | wc -l >>log\n");
     EXPECT_EQ(run_notify_commands(run(10000)), NOTIFY_FAILED);
@@ -194,7 +194,7 @@ TEST_F(Commands, EndWithTheirWholeGroupWhenTheyTakeTooLong) {
     add("20-stubborn", "trap '' TERM; sleep 100 & echo $! >stubborn; wait; wait\n");
     add("30-next", "echo next >next\n");
     const int64_t began = lt_monotonic_ms();
-    EXPECT_EQ(run_notify_commands(run(400)), NOTIFY_TIMED_OUT);
+    EXPECT_EQ(run_notify_commands(run(300)), NOTIFY_TIMED_OUT);
     EXPECT_LT(lt_monotonic_ms() - began, 8000);
     EXPECT_FALSE(alive("slow") || alive("stubborn"));
     EXPECT_EQ(read("next"), "next\n");

@@ -436,10 +436,10 @@ TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
               "the router redirects this appliance's own traffic\n"
               "refused source 10.0.0.9: mgmtctl tunnel accept 10.0.0.9\n"
               "packets arrive in fragments, and the MSS of no flow has been clamped\n");
-    for (int i = 0; i < 255; i++) {
-        EXPECT_TRUE(lacks(tunnels(CTL_OK), "not listed")) << i;
+    for (int i = 0; i < 254; i++)
         from.add(NODE_PLANE_STATE "/refused_source/10.9.0." + std::to_string(i), "1");
-    }
+    EXPECT_TRUE(lacks(tunnels(CTL_OK), "not listed"));
+    from.add(NODE_PLANE_STATE "/refused_source/10.9.0.254", "1");
     EXPECT_TRUE(contains(tunnels(CTL_OK), "not listed"));
     EXPECT_EQ(intercepts("", CTL_OK), "51 port 80 443 to 3128 check http /a\n"
                                       "  proxy down 0:10:40: refused?[2J\n"

@@ -92,6 +92,20 @@ TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
                   "\"before\":3,\"after\":null}\n");
 }
 
+TEST(Shown, JsonIsWrittenInAsciiAndReadToADepth) {
+    const strings pair = {"a", "b"};
+    ctl_json made = {{"z", UINT64_MAX}, {"a", {{"x", -1}, {"y", nullptr}}}, {"pair", pair}, {"z", 2}};
+    made["list"].push_back({1.5, true, "\xc3\xa4\xff\x7f\n"});
+    made.update({{"a", ctl_json::array()}});
+    EXPECT_EQ(json_text(made), "{\"z\":18446744073709551615,\"a\":[],\"pair\":[\"a\",\"b\"],"
+                               "\"list\":[[1.5,true,\"\\u00e4\\ufffd\\u007f\\n\"]]}");
+    const auto nested = [](size_t depth) { return std::string(depth, '[') + std::string(depth, ']'); };
+    ctl_json read;
+    EXPECT_TRUE(parse_json(nested(100), &read) && json_text(read) == nested(100));
+    EXPECT_FALSE(parse_json(nested(101), &read) || parse_json("[1] 2", &read) || parse_json("", &read));
+    EXPECT_TRUE(parse_json("{\"a\":1,\"a\":-2}", &read) && json_text(read["a"]) == "-2");
+}
+
 // --- Changes
 
 TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
