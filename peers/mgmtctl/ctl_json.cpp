@@ -75,3 +75,7 @@ void ctl_json::update(const ctl_json &other) {
     for (size_t i = 0; i < other.names.size(); i++)
         (*this)[other.names[i]] = other.items[i];
 }
+
+ctl_json text_or_null(const std::string &text) {
+    return text.empty() ? ctl_json(nullptr) : ctl_json(text);
+}

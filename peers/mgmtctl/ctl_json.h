@@ -50,6 +50,8 @@ struct ctl_json {
     bool is_number() const { return is_whole_number() || type == kind::real; }
 };
 
+ctl_json text_or_null(const std::string &text); // null: the text is empty
+
 // ASCII only; what is not UTF-8 is replaced. With an indent there is one line for each item.
 std::string json_text(const ctl_json &value, int indent = -1);
 // A name that an object has twice stays in it twice; operator[] finds the last one. False when the text is

@@ -28,7 +28,7 @@ std::string group_of(const std::string &text) {
     return name.text();
 }
 
-std::string number_of(const std::string &root) {
+std::string instance_number(const std::string &root) {
     return root.substr(root.rfind('/') + 1);
 }
 
@@ -103,7 +103,7 @@ std::string hint_for_missing(const ctl_ask &ask, const std::string &text) {
     if (const std::string group = group_of(text); !group.empty()) {
         ctl_reply reply;
         if (ask(ctl_walk::node, group, &reply) && reply.bindings.empty())
-            return "there is no group " + number_of(group);
+            return "there is no group " + instance_number(group);
     }
     // A name that exists, but only as the beginning of longer ones.
     ctl_reply below;
@@ -367,12 +367,12 @@ change_notes notes_of(const std::vector<ctl_change_item> &items, const groups_be
     }
     for (const auto &[root, words] : whole)
         if (!ended.contains(root))
-            out.notes.push_back("group " + number_of(root) + ": wccpd applies a change of " +
+            out.notes.push_back("group " + instance_number(root) + ": wccpd applies a change of " +
                                 join_words(words) + " only by recreating the group");
     for (const auto &[root, words] : at_start)
         // A group that is recreated anyway applies these changes as well.
         if (!ended.contains(root) && !whole.contains(root))
-            out.notes.push_back("group " + number_of(root) + ": " +
-                                at_start_note(join_words(words), number_of(root)));
+            out.notes.push_back("group " + instance_number(root) + ": " +
+                                at_start_note(join_words(words), instance_number(root)));
     return out;
 }

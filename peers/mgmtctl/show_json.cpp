@@ -1,15 +1,12 @@
 // A snapshot for scripts. The keys are documented (docs/mgmtctl.md) and stay; what isn't known is null.
-
 #include "peers/mgmtctl/show_json.h"
+
 #include "peers/mgmtctl/reasons.h"
 #include "peers/mgmtctl/show_draw.h"
 #include "peers/mgmtctl/traffic_json.h"
 
 namespace {
 
-ctl_json text_or_null(const std::string &text) {
-    return text.empty() ? ctl_json(nullptr) : ctl_json(text);
-}
 ctl_json number_or_null(int64_t number) {
     return number < 0 ? ctl_json(nullptr) : ctl_json(number);
 }

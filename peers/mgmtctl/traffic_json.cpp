@@ -1,10 +1,6 @@
 #include "peers/mgmtctl/traffic_json.h"
 
 namespace {
-ctl_json text_or_null(const std::string &text) {
-    return text.empty() ? ctl_json(nullptr) : ctl_json(text);
-}
-
 ctl_json packets_json(const std::map<std::string, uint64_t> &packets) {
     ctl_json out = ctl_json::object();
     for (const auto &[name, count] : packets)
