@@ -162,9 +162,8 @@ lab_plug() { # NODE PID ADDRESS...
         echo 'link set lo up'
         for address; do echo "address add $address/24 dev eth0"; done
         echo 'link set eth0 up'
+        [[ " $*" != *' 10.0.0.'* ]] || echo 'route add default via 10.0.0.254'
     } | nsenter -t "$pid" --net ip -batch - || lab_die "cannot set up eth0 of $node"
-    nsenter -t "$pid" --net ip route add default via 10.0.0.254 2>/dev/null # not from every network
-    return 0
 }
 
 # Creates a namespace with a wccp_router that simulates a router on each address.
@@ -211,13 +210,14 @@ lab_behind() { # NODE ROUTER NET
     LAB_NET[$node]=$net
     ip link add eth0 netns "${LAB_INIT[$node]}" type veth peer name "$node" netns "${LAB_INIT[$router]}" ||
         lab_die "no veth for $node"
-    lab_in "$router" ip address add "$net.1/24" dev "$node"
-    lab_in "$router" ip link set "$node" up
-    lab_in "$node" ip link set lo up
-    lab_in "$node" ip address add "$net.2/24" dev eth0
-    lab_in "$node" ip link set eth0 up
-    lab_in "$node" ip route add local "$net.128/25" dev lo
-    lab_gateway "$node" "$net.1"
+    lab_in "$router" ip -batch - <<<"address add $net.1/24 dev $node"$'\n'"link set $node up" || lab_die "cannot set up $node of $router"
+    lab_in "$node" ip -batch - <<END || lab_die "cannot set up eth0 of $node"
+link set lo up
+address add $net.2/24 dev eth0
+link set eth0 up
+route add local $net.128/25 dev lo
+route add default via $net.1
+END
 }
 lab_gateway() { # NODE ADDRESS
     lab_in "$1" ip route replace default via "$2" || lab_die "cannot set the default route of $1"
@@ -231,7 +231,7 @@ lab_server() { # NODE ROUTER [NET]
     LAB_PID[$1/web]=$!
     local i
     for ((i = 0; i < 100; i++)); do
-        [ "$(lab_in "$1" cat /proc/net/tcp | grep -cE ' 0+:(0050|1F90) 0+:0+ 0A')" != 2 ] || return 0
+        [ "$(grep -cE ' 0+:(0050|1F90) 0+:0+ 0A' "/proc/${LAB_INIT[$1]}/net/tcp")" != 2 ] || return 0
         lab_pause 0.05
     done
     lab_die "the web server of $1 did not start"
@@ -240,11 +240,12 @@ lab_fetch() { # CLIENT [OPTIONS...]
     lab_in "$1" "$WCCP_BIN/wccp_router" fetch --from "${LAB_NET[$1]}.128" 10.2.0.2 "${@:2}"
 }
 lab_proxy() { # NODE [PORT] [keep]
-    local port=${2:-3129} i
+    local port=${2:-3129} hex i
+    printf -v hex %04X "$port"
     lab_start "$1" proxy "$(command -v env)" "LAB_NODE=$1" "LAB_PORT=$port" \
         "LAB_SOURCE=0.0.0.0${3:+ usesrc clientip}" "$(PATH=$PATH:/usr/sbin command -v haproxy)" -db -f "$LAB_HOME/haproxy.cfg"
     for ((i = 0; i < 200; i++)); do
-        ! lab_in "$1" cat /proc/net/tcp | grep -q "$(printf ' 0*:%04X 0*:0* 0A' "$port")" || return 0
+        ! grep -q " 0*:$hex 0*:0* 0A" "/proc/${LAB_INIT[$1]}/net/tcp" || return 0
         lab_alive "$1" proxy || break
         lab_pause 0.05
     done
@@ -297,7 +298,7 @@ lab_in() { # NAME COMMAND...
     [ -n "${LAB_INIT[$node]-}" ] || lab_die "there is no $node"
     # --root, because the whole lab may run inside a chroot.
     [ -n "${LAB_BARE[$node]-}" ] || all=(--mount --root --ipc --pid --wdns=/)
-    (cd / && exec nsenter -t "${LAB_INIT[$node]}" --net "${all[@]}" "$@")
+    nsenter -t "${LAB_INIT[$node]}" --net "${all[@]}" "$@"
 }
 
 # Sets LAB_CLOCK to the command prefix that makes a program run by the clock of the protocol.
@@ -399,10 +400,11 @@ lab_ctl() { # ROUTER COMMAND... : sends a command to a simulated router
 # Runs a command repeatedly until the jq expression is true for its output. After that many seconds it prints the last
 # output, and the result is 1.
 lab_wait() { # SECONDS EXPRESSION COMMAND...
-    local limit=$(($1 * LAB_PATIENCE)) expression=$2 began=$SECONDS pause=0.2 last='' before=''; shift 2
+    local limit=$(($1 * LAB_PATIENCE)) expression=$2 began=$SECONDS pause=0.2 last='' before='' LAB_WALKED=yes; shift 2
     while :; do
-        # jq takes longer to start than anything else here.
-        last=$("$@" 2>&1) && [ "$last" != "$before" ] && jq -e "$expression" <<<"$last" >/dev/null 2>&1 && return 0
+        # jq takes longer to start than anything else here: only for output that has changed, and once.
+        last=$("$@" 2>&1) && [ "$last" != "$before" ] &&
+            jq -en "$LAB_SHAPE | $expression" <<<"$last" >/dev/null 2>&1 && return 0
         before=$last
         [ $((SECONDS - began)) -lt "$limit" ] || break
         lab_pause $pause
@@ -418,7 +420,7 @@ lab_wait_until() { # SECONDS COMMAND...
     until "$@"; do
         [ $((SECONDS - began)) -lt "$limit" ] || return 1
         lab_pause $pause
-        [ $((SECONDS - began)) -lt 2 ] || pause=0.3
+        [ $((SECONDS - began)) -lt 1 ] || pause=0.3
     done
 }
 # Waits for a line in a file.
@@ -491,10 +493,10 @@ lab_wccpd_start() { # NODE
     before=$(grep -c 'wccpd_init: encap entries:' "$LAB/$1.log")
     lab_start "$1" wccpd wccpd
     local i
-    for ((i = 0; i < 600; i++)); do
+    for ((i = 0; i < 300; i++)); do
         [ "$(grep -c 'wccpd_init: encap entries:' "$LAB/$1.log")" -gt "$before" ] && return
         lab_alive "$1" wccpd || break
-        lab_pause 0.05
+        lab_pause 0.1
     done
     lab_show_and_die "$1" "wccpd of $1 did not start"
 }
@@ -508,16 +510,16 @@ lab_show_and_die() { # NODE TEXT
 
 lab_configure() { # NODE [TEXT]...
     local before now i
-    before=$(lab_events "$1" | wc -l)
+    mapfile -t before <"$LAB/$1-mgmtd.out"
     lab_write_config "$@" || return
     kill -HUP "$(lab_pid "$1" mgmtd)"
     for ((i = 0; i < 200 * LAB_PATIENCE; i++)); do
-        now=$(lab_events "$1" | tail -n +$((before + 1)))
-        [[ $now != *'configuration read again: '* ]] || return 0
-        [[ $now != *$LAB_CONFIG:* ]] || break
+        mapfile -s "${#before[@]}" now <"$LAB/$1-mgmtd.out"
+        [[ ${now[*]} != *'configuration read again: '* ]] || return 0
+        [[ ${now[*]} != *$LAB_CONFIG:* ]] || break
         lab_pause 0.05
     done
-    echo "lab: mgmtd of $1 refused the configuration: $now" >&2
+    echo "lab: mgmtd of $1 refused the configuration: ${now[*]}" >&2
     return 1
 }
 
@@ -558,7 +560,7 @@ lab_log() { # NODE
     tail -n +$((${LAB_MARKED[$1]-0} + 1)) "$LAB/$1.log"
 }
 lab_logged() { # NODE EXPRESSION
-    grep -Eq -- "$2" < <(lab_log "$1")
+    grep -Eq -- "$2" "$LAB/$1.log" && grep -Eq -- "$2" < <(lab_log "$1") # mostly only the first is needed
 }
 lab_wait_log() { # SECONDS NODE EXPRESSION
     lab_wait_until "$1" lab_logged "${@:2}" || { echo "lab: after $(($1 * LAB_PATIENCE)) s no line in the log of $2: $3" >&2; return 1; }
@@ -568,14 +570,22 @@ lab_manage() { # NODE WORDS...
     lab_in "$1" "$WCCP_BIN/mgmtctl" --json "${@:2}"
 }
 
-# Prints the nodes below a name as nested objects: /a/b/c/d below /a/b is {"c": {"d": VALUE}}.
+# Prints the nodes below a name as nested objects: /a/b/c/d below /a/b is {"c": {"d": VALUE}}. In lab_wait, prints what
+# LAB_SHAPE makes that of: the name, and the nodes as mgmtctl prints them.
 lab_tree() { # NODE NAME
-    lab_manage "$1" walk "$2" 2>/dev/null | jq -c --arg name "${2%/}" '
-        (arrays // []) |
-        (reduce (.[].name | split("/") | range(1; length) as $depth | .[:$depth] | join("/")) as $above ({}; .[$above] = true)) as $parents |
-        map(select($parents[.name] | not)) |
-        reduce .[] as $node ({}; setpath($node.name | split("/")[($name | split("/") | length):]; $node.value)) | objects // {}'
+    if [ -n "${LAB_WALKED-}" ]; then
+        echo "{\"below\": \"${2%/}\"}"
+        lab_manage "$1" walk "$2" 2>/dev/null || true
+    else
+        LAB_WALKED=yes lab_tree "$@" | jq -cn "$LAB_SHAPE"
+    fi
 }
+LAB_SHAPE='
+    def tree($depth):
+        (reduce (.[].name | split("/") | range(1; length) as $n | .[:$n] | join("/")) as $above ({}; .[$above] = true)) as $parents |
+        reduce (.[] | select($parents[.name] | not)) as $node ({}; setpath($node.name | split("/")[$depth:]; $node.value));
+    [inputs] | (.[0] | objects.below // null) as $name |
+    if $name then .[1:][] | arrays // [] | tree($name | split("/") | length) else .[] end'
 # {"51": {"oper": "ACTIVE, DESIGNATED", "router": {"1": {"state": ..., "appliance": {"10.0.0.101": {"load_dist": 100}}}},
 # "appliance": {"1": {"ipaddr": ..., "weight": ...}}, ...}}
 lab_state() { # NODE [GROUP]
@@ -591,18 +601,22 @@ lab_tunneld_state() { # NODE KIND
 lab_remains() { # NODE
     lab_in "$1" bash -c '
         for own in /proc/[0-9]*; do
-            [ "${own#/proc/}" = 1 ] || [ "${own#/proc/}" = $$ ] || tr "\0" " " <$own/cmdline 2>/dev/null | sed "s/^/process /;s/\$/\n/"
+            [ "${own#/proc/}" = 1 ] || [ "${own#/proc/}" = $$ ] || { mapfile -d "" words <$own/cmdline && [ ${#words[@]} -gt 0 ] && echo "process ${words[*]}"; } 2>/dev/null
         done
-        awk "FNR > 1 && ! (\$7 == 0 && (\$1 == -1091567891 || \$1 == 1464025933)) { print \"segment\", \$1, \"attached\", \$7 }" /proc/sysvipc/shm
-        tail -n +2 -q /proc/sysvipc/sem /proc/sysvipc/msg | grep -v "^-1091567891 " | sed "s/^/semaphore or queue /"
-        grep -hE "^ *[0-9]+: [0-9A-F]+:0800" /proc/net/udp /proc/net/raw | sed "s/^/socket /"
-        sed 1d /proc/net/unix | grep -o "/.*" | grep -v "^/dev/log\$" | sed "s/^/socket /"
-        sed "1,2d;s/:.*//;s/^ */interface /" /proc/net/dev
-        ip -o link show group 2048 | sed "s/^[0-9]*: /interface of group 2048 /;s/:.*//"
-        ip rule show | grep "proto 204" | sed "s/^/ip rule /"
-        ip route show table all | awk "match(\$0, / table [0-9]+/) && substr(\$0, RSTART + 7, RLENGTH - 7) >= 204800 { print \"route\", \$0 }"
-        nft list tables 2>/dev/null | grep tunneld | sed "s/^/nft /"
-        ls -d /tmp/gcl-socks/* 2>/dev/null | sed "s/^/file /"'
+        for own in /tmp/gcl-socks/*; do [ ! -e "$own" ] || echo "file $own"; done
+        awk "
+            FNR == 1 { n = split(FILENAME, path, \"/\"); table = path[n]; if (table != \"unix\") next }
+            table == \"shm\" && ! (\$7 == 0 && (\$1 == -1091567891 || \$1 == 1464025933)) { print \"segment\", \$1, \"attached\", \$7 }
+            (table == \"sem\" || table == \"msg\") && \$1 != -1091567891 { print \"semaphore or queue\", \$0 }
+            (table == \"udp\" || table == \"raw\") && \$2 ~ /:0800\$/ { print \"socket\", \$0 }
+            table == \"unix\" && match(\$0, /\\/.*/) && substr(\$0, RSTART) != \"/dev/log\" { print \"socket\", substr(\$0, RSTART) }
+            table == \"dev\" && FNR > 2 { sub(/:.*/, \"\"); print \"interface\", \$1 }
+        " /proc/sysvipc/shm /proc/sysvipc/sem /proc/sysvipc/msg /proc/net/udp /proc/net/raw /proc/net/unix /proc/net/dev
+        { printf "%s\n" "link show group 2048" "rule show" "route show table all" | ip -o -force -batch -; nft list tables 2>/dev/null; } | awk "
+            /^[0-9]+: [^ ]+: </ { sub(/:\$/, \"\", \$2); print \"interface of group 2048\", \$2 }
+            / proto 204/ && /^[0-9]+:/ { print \"ip rule\", \$0 }
+            match(\$0, / table [0-9]+/) && substr(\$0, RSTART + 7, RLENGTH - 7) >= 204800 { print \"route\", \$0 }
+            /^table .* tunneld/ { print \"nft\", \$0 }"'
 }
 
 lab_end() { # NODE...
