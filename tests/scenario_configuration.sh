@@ -8,6 +8,74 @@ export LAB_SPEED=${LAB_SPEED:-8}
 source "$(dirname "$0")/../lab/cases.sh"
 lab_cases "$@"
 
+# Commits during the start of wccpd: 30 starts with 256 groups and 10 commits each, none of which is lost. With a
+# sanitizer, where commits take long, 3 starts.
+case_start() {
+    local id text='' round rounds=30 absent=0 commits running configured nodes=/qv/wccpd/wccp/srv_grp/config
+    for id in $(seq 0 255); do text+="$(lab_group "$id" 10.0.0.1 "weight=$id")"$'\n'; done
+    LAB_LOG_LEVEL=notice start_appliance a1 10.0.0.101 "$text"
+    ! grep -q __asan_init "$WCCP_BIN/wccpd" || rounds=3
+    for round in $(seq $rounds); do
+        lab_stop a1 wccpd || die "wccpd exited with $?"
+        # One group is deleted, the one deleted before is created again, and eight others change.
+        lab_in a1 bash -c "set -e; exec {never}<> <(:)
+            ctl() { '$WCCP_BIN/mgmtctl' --timeout 60 \"\$@\"; read -rt 0.0\$((RANDOM % 4)) -u \$never || true; }
+            ctl delete $nodes/$round
+            for id in \$(shuf -i 100-255 -n 8); do ctl set $nodes/\$id/weight=$round\$((RANDOM % 100)); done
+            ctl set $nodes/$absent/{interface=eth0,router/1/ipaddr=10.0.0.1,weight=$round}" >"$LAB/commits.out" 2>&1 &
+        commits=$!
+        lab_wccpd_start a1
+        wait $commits || die "commits: $(cat "$LAB/commits.out")"
+        absent=$round
+        running=$(lab_manage a1 walk --children ${nodes/config/state} | jq -r '.[].name + "/debug"')
+        configured=$(lab_manage a1 walk --children $nodes | jq -r '.[].name + "/weight"')
+        # shellcheck disable=SC2086
+        diff <(lab_manage a1 get $running | jq -r '.[] | "\(.name | split("/")[6]) \(.value | capture("WCCP weight *: (?<w>[0-9]+)").w)"' | sort) \
+            <(lab_manage a1 get $configured | jq -r '.[] | "\(.name | split("/")[6]) \(.value)"' | sort) >&2 ||
+            die "start $round: the running groups differ from the configuration"
+    done
+    finish a1
+}
+
+# mgmtd is killed while three clients commit (WCCP_KILLS times): the file and the history have every commit that was
+# acknowledged, and no half-written files are left.
+case_killed() {
+    lab_appliance a1 10.0.0.101
+    # shellcheck disable=SC2016
+    lab_in a1 bash -c '
+        bin=$1 dir=/etc/opt/rvl/kept node=/qv/wccpd/wccp/srv_grp/config cut=0 mgmtd=
+        fail() { echo "kill $kill: $*"; cat $dir/out; exit 1; }
+        ctl() { "$bin/mgmtctl" --timeout 20 "$@" 2>/dev/null; }
+        start() {
+            "$bin/mgmtd" --config $dir/conf >>$dir/out 2>&1 & mgmtd=$!
+            until ctl get /qv/tunneld/system/config/mode >/dev/null; do kill -0 $mgmtd || fail "does not start"; sleep 0.01; done
+        }
+        change() { local n=$2; while ctl set $node/$1/weight=$n; do echo $n >$dir/acknowledged-$1; n=$((n + 1)); done; }
+        mkdir $dir; start; ctl set $node/{1,2,3}/weight=0 >/dev/null
+        for kill in $(seq "$2"); do
+            at=()
+            for id in 1 2 3; do
+                at[id]=$(ctl get $node/$id/weight)
+                last=$(cat $dir/acknowledged-$id 2>/dev/null || echo 0)
+                [ "${at[id]}" = "$last" ] || [ "${at[id]}" = $((last + 1)) ] || fail "$last was acknowledged, there is ${at[id]}"
+                echo "${at[id]}" >$dir/acknowledged-$id
+                change $id $((at[id] + 1)) &
+                clients[id]=$!
+            done
+            sleep "0.$(printf %03d $((RANDOM % 150 + 10)))"
+            kill -KILL $mgmtd; wait $mgmtd "${clients[@]}"
+            [ -z "$(find $dir -name "*unfinished" -o -name pending)" ] || cut=$((cut + 1))
+            "$bin/mgmtd" --config $dir/conf --check || fail "the file is broken"
+            start
+            [ -z "$(find $dir -name "*unfinished" -o -name pending)" ] || fail "something is left over"
+            last=$(ctl history --json | jq -r "if length <= 50 and all(.[]; .commit == 1 or .cause == \"set\") then .[0].commit else 0 end")
+            [ -z "$(ctl diff "$last" || echo failed)" ] || fail "commit $last is not the configuration"
+        done 2>/dev/null
+        ! grep "can.t be" $dir/out || fail "an entry is broken"
+        echo "$kill kills, $cut of them in a commit, $(ctl history --json | jq ".[0].commit") commits"
+        kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" "${WCCP_KILLS:-60}" || die "mgmtd did not survive a kill"
+}
+
 words=(assign_method=hash)
 # Adds a NAME=VALUE to the group, or changes its value, and expects wccpd to apply it to the running group.
 change() { # NAME=VALUE LINE_OF_THE_LOG
@@ -163,74 +231,6 @@ case_bridge() {
     router_is r1 1 51 ".counters.rx_here_i_am == $sent"
     group_is a1 5 51 '.oper == "INIT"'
     finish a1
-}
-
-# Commits during the start of wccpd: 30 starts with 256 groups and 10 commits each, none of which is lost. With a
-# sanitizer, where commits take long, 3 starts.
-case_start() {
-    local id text='' round rounds=30 absent=0 commits running configured nodes=/qv/wccpd/wccp/srv_grp/config
-    for id in $(seq 0 255); do text+="$(lab_group "$id" 10.0.0.1 "weight=$id")"$'\n'; done
-    LAB_LOG_LEVEL=notice start_appliance a1 10.0.0.101 "$text"
-    ! grep -q __asan_init "$WCCP_BIN/wccpd" || rounds=3
-    for round in $(seq $rounds); do
-        lab_stop a1 wccpd || die "wccpd exited with $?"
-        # One group is deleted, the one deleted before is created again, and eight others change.
-        lab_in a1 bash -c "set -e
-            ctl() { '$WCCP_BIN/mgmtctl' --timeout 60 \"\$@\"; sleep 0.0\$((RANDOM % 4)); }
-            ctl delete $nodes/$round
-            for id in \$(shuf -i 100-255 -n 8); do ctl set $nodes/\$id/weight=$round\$((RANDOM % 100)); done
-            ctl set $nodes/$absent/{interface=eth0,router/1/ipaddr=10.0.0.1,weight=$round}" >"$LAB/commits.out" 2>&1 &
-        commits=$!
-        lab_wccpd_start a1
-        wait $commits || die "commits: $(cat "$LAB/commits.out")"
-        absent=$round
-        running=$(lab_manage a1 walk --children ${nodes/config/state} | jq -r '.[].name + "/debug"')
-        configured=$(lab_manage a1 walk --children $nodes | jq -r '.[].name + "/weight"')
-        # shellcheck disable=SC2086
-        diff <(lab_manage a1 get $running | jq -r '.[] | "\(.name | split("/")[6]) \(.value | capture("WCCP weight *: (?<w>[0-9]+)").w)"' | sort) \
-            <(lab_manage a1 get $configured | jq -r '.[] | "\(.name | split("/")[6]) \(.value)"' | sort) >&2 ||
-            die "start $round: the running groups differ from the configuration"
-    done
-    finish a1
-}
-
-# mgmtd is killed while three clients commit (WCCP_KILLS times): the file and the history have every commit that was
-# acknowledged, and no half-written files are left.
-case_killed() {
-    lab_appliance a1 10.0.0.101
-    # shellcheck disable=SC2016
-    lab_in a1 bash -c '
-        bin=$1 dir=/etc/opt/rvl/kept node=/qv/wccpd/wccp/srv_grp/config cut=0 mgmtd=
-        fail() { echo "kill $kill: $*"; cat $dir/out; exit 1; }
-        ctl() { "$bin/mgmtctl" --timeout 20 "$@" 2>/dev/null; }
-        start() {
-            "$bin/mgmtd" --config $dir/conf >>$dir/out 2>&1 & mgmtd=$!
-            until ctl get /qv/tunneld/system/config/mode >/dev/null; do kill -0 $mgmtd || fail "does not start"; sleep 0.01; done
-        }
-        change() { local n=$2; while ctl set $node/$1/weight=$n; do echo $n >$dir/acknowledged-$1; n=$((n + 1)); done; }
-        mkdir $dir; start; ctl set $node/{1,2,3}/weight=0 >/dev/null
-        for kill in $(seq "$2"); do
-            at=()
-            for id in 1 2 3; do
-                at[id]=$(ctl get $node/$id/weight)
-                last=$(cat $dir/acknowledged-$id 2>/dev/null || echo 0)
-                [ "${at[id]}" = "$last" ] || [ "${at[id]}" = $((last + 1)) ] || fail "$last was acknowledged, there is ${at[id]}"
-                echo "${at[id]}" >$dir/acknowledged-$id
-                change $id $((at[id] + 1)) &
-                clients[id]=$!
-            done
-            sleep "0.$(printf %03d $((RANDOM % 150 + 10)))"
-            kill -KILL $mgmtd; wait $mgmtd "${clients[@]}"
-            [ -z "$(find $dir -name "*unfinished" -o -name pending)" ] || cut=$((cut + 1))
-            "$bin/mgmtd" --config $dir/conf --check || fail "the file is broken"
-            start
-            [ -z "$(find $dir -name "*unfinished" -o -name pending)" ] || fail "something is left over"
-            last=$(ctl history --json | jq -r "if length <= 50 and all(.[]; .commit == 1 or .cause == \"set\") then .[0].commit else 0 end")
-            [ -z "$(ctl diff "$last" || echo failed)" ] || fail "commit $last is not the configuration"
-        done 2>/dev/null
-        ! grep "can.t be" $dir/out || fail "an entry is broken"
-        echo "$kill kills, $cut of them in a commit, $(ctl history --json | jq ".[0].commit") commits"
-        kill $mgmtd; wait $mgmtd' - "$WCCP_BIN" "${WCCP_KILLS:-60}" || die "mgmtd did not survive a kill"
 }
 
 # On a full disk a commit is refused, and the configuration and its history stay as they were.

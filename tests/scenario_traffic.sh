@@ -47,6 +47,73 @@ traffic_is() { # SECONDS JQ
     lab_wait "$1" "$2" lab_ctl r1 traffic || die "traffic of r1"
 }
 
+# While another group of the policy group has no router, new flows go to the server, and established ones stay with the
+# proxy. The same while wccpd is not running.
+case_roles() {
+    start_traffic --forward gre --return gre
+    lab_router r2 10.0.0.2
+    start_proxied a1 10.0.0.101 '' '[/qv/wccpd/wccp/policy_grp/config/5]' name=blue "$(lab_group 51 10.0.0.1 policy_grp=5)" \
+        "$(lab_group 52 10.0.0.2 policy_grp=5)" "$(lab_intercept 51 ports=80)"
+    wait_ready 51 a1
+    active_is() { tunneld_is a1 "$2" intercept ".[\"51\"].active == $1"; }
+    active_is true 20
+    lab_fetch c1 --size 1000 --requests 300 --pause 0.1 >"$LAB/kept" &
+    local kept=$! i
+    for i in 1 2; do
+        lab_ctl r2 stop >/dev/null
+        active_is false 30
+        explains a1 5 51 standing-by
+        fetches "$direct" --count 4
+        lab_ctl r2 resume >/dev/null
+        active_is true 30
+        fetches "$(by a1)" --count 4
+    done
+    wait $kept
+    jq -e "$(by a1)" "$LAB/kept" >/dev/null || die "the established connection: $(cat "$LAB/kept")"
+    lab_stop a1 wccpd
+    active_is false 5
+    fetches "$direct" --count 4
+    finish a1
+}
+
+# tunneld is killed repeatedly during transfers: each transfer completes or is reset, wccpd keeps running, and new fetches
+# succeed.
+case_kills() {
+    start_traffic --forward gre --return gre
+    lab_appliance a1 10.0.0.101
+    lab_gateway a1 10.0.0.1
+    lab_proxy a1
+    lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
+    lab_supervise a1
+    wait_ready 51 a1
+    local wccpd i transfers results=$LAB/transfers
+    wccpd=$(lab_in a1 pgrep -x wccpd)
+    for ((i = 1; i <= ${LAB_KILLS-5}; i++)); do
+        lab_fetch c1 --parallel 4 --count 4 --size 30000000 --timeout 15 >>"$results" &
+        transfers=($!)
+        lab_fetch c1 --parallel 4 --count 4 --upload 30000000 --timeout 15 --port 8080 >>"$results" &
+        transfers+=($!)
+        sleep "0.$((RANDOM % 90 + 10))"
+        lab_in a1 pkill -KILL -x tunneld || die "cannot kill tunneld"
+        fetches_within 3 "$(by a1)"
+        wait "${transfers[@]}"
+    done
+    jq -se 'length > 0 and all(.[]; .failures | keys - ["reset", "closed"] == [])' "$results" >/dev/null || die "transfers: $(cat "$results")"
+    [ "$(lab_in a1 pgrep -x wccpd)" = "$wccpd" ] || die "wccpd was restarted"
+    # A link that somebody else deletes is created again.
+    lab_in a1 ip link delete wccp0 || die "cannot delete the link"
+    fetches_within 12 "$(by a1)"
+    # All programs are killed at once; the next ones take over their links and rules.
+    lab_in a1 pkill -KILL -x 'mgmtd|tunneld|wccpd'
+    lab_wait_exit 5 a1 mgmtd
+    lab_supervise a1
+    wait_ready 51 a1
+    fetches "$(by a1)" --count 4
+    lab_stop a1 mgmtd || die "mgmtd exited with $?"
+    LAB_KILLED[a1]+='|uds-client-(wccpd|tunneld)-[0-9]+$'
+    finish a1
+}
+
 # Two appliances share the flows by their weights. Bypassed addresses and other ports reach the server from the client's
 # address. Full-size packets pass both ways.
 case_gre_hash() {
@@ -259,73 +326,6 @@ case_accept() {
     lab_manage a1 tunnel accept 10.1.0.1 >/dev/null || die "tunnel accept failed"
     fetches_within 5 "$(by a1)" --count 4
     fetches "$direct" --count 4 --port 8080
-    finish a1
-}
-
-# While another group of the policy group has no router, new flows go to the server, and established ones stay with the
-# proxy. The same while wccpd is not running.
-case_roles() {
-    start_traffic --forward gre --return gre
-    lab_router r2 10.0.0.2
-    start_proxied a1 10.0.0.101 '' '[/qv/wccpd/wccp/policy_grp/config/5]' name=blue "$(lab_group 51 10.0.0.1 policy_grp=5)" \
-        "$(lab_group 52 10.0.0.2 policy_grp=5)" "$(lab_intercept 51 ports=80)"
-    wait_ready 51 a1
-    active_is() { tunneld_is a1 "$2" intercept ".[\"51\"].active == $1"; }
-    active_is true 20
-    lab_fetch c1 --size 1000 --requests 300 --pause 0.1 >"$LAB/kept" &
-    local kept=$! i
-    for i in 1 2; do
-        lab_ctl r2 stop >/dev/null
-        active_is false 30
-        explains a1 5 51 standing-by
-        fetches "$direct" --count 4
-        lab_ctl r2 resume >/dev/null
-        active_is true 30
-        fetches "$(by a1)" --count 4
-    done
-    wait $kept
-    jq -e "$(by a1)" "$LAB/kept" >/dev/null || die "the established connection: $(cat "$LAB/kept")"
-    lab_stop a1 wccpd
-    active_is false 5
-    fetches "$direct" --count 4
-    finish a1
-}
-
-# tunneld is killed repeatedly during transfers: each transfer completes or is reset, wccpd keeps running, and new fetches
-# succeed.
-case_kills() {
-    start_traffic --forward gre --return gre
-    lab_appliance a1 10.0.0.101
-    lab_gateway a1 10.0.0.1
-    lab_proxy a1
-    lab_write_config a1 "$(lab_group 51 10.0.0.1)" "$(lab_intercept 51 ports=80)"
-    lab_supervise a1
-    wait_ready 51 a1
-    local wccpd i transfers results=$LAB/transfers
-    wccpd=$(lab_in a1 pgrep -x wccpd)
-    for ((i = 1; i <= ${LAB_KILLS-5}; i++)); do
-        lab_fetch c1 --parallel 4 --count 4 --size 30000000 --timeout 15 >>"$results" &
-        transfers=($!)
-        lab_fetch c1 --parallel 4 --count 4 --upload 30000000 --timeout 15 --port 8080 >>"$results" &
-        transfers+=($!)
-        sleep "0.$((RANDOM % 90 + 10))"
-        lab_in a1 pkill -KILL -x tunneld || die "cannot kill tunneld"
-        fetches_within 3 "$(by a1)"
-        wait "${transfers[@]}"
-    done
-    jq -se 'length > 0 and all(.[]; .failures | keys - ["reset", "closed"] == [])' "$results" >/dev/null || die "transfers: $(cat "$results")"
-    [ "$(lab_in a1 pgrep -x wccpd)" = "$wccpd" ] || die "wccpd was restarted"
-    # A link that somebody else deletes is created again.
-    lab_in a1 ip link delete wccp0 || die "cannot delete the link"
-    fetches_within 12 "$(by a1)"
-    # All programs are killed at once; the next ones take over their links and rules.
-    lab_in a1 pkill -KILL -x 'mgmtd|tunneld|wccpd'
-    lab_wait_exit 5 a1 mgmtd
-    lab_supervise a1
-    wait_ready 51 a1
-    fetches "$(by a1)" --count 4
-    lab_stop a1 mgmtd || die "mgmtd exited with $?"
-    LAB_KILLED[a1]+='|uds-client-(wccpd|tunneld)-[0-9]+$'
     finish a1
 }
 
