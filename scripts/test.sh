@@ -35,7 +35,7 @@ build_preset() { # PRESET [TARGET...]
 # A test that fails is run once more, since scenarios hold real programs to their seconds on a machine that may be busy.
 run_ctest() { # PRESET ARGUMENTS...
     local preset=$1 log=build/$1/ctest.log status name total fails; shift
-    ctest --test-dir "build/$preset" -j $((jobs * 2)) --output-on-failure --no-tests=error --repeat until-pass:2 "$@" >"$log" 2>&1
+    ctest --test-dir "build/$preset" -j $((jobs * 3)) --output-on-failure --no-tests=error --repeat until-pass:2 "$@" >"$log" 2>&1
     status=$?
     if [ $status -ne 0 ]; then grep -vE '^ *[0-9]+/[0-9]+ Test .* Passed|^ *Start ' "$log" | tail -n 150; fi
     for name in $(sed -n 's/^ *[0-9]*\/[0-9]* Test *#[0-9]*: \([a-z0-9_]*\) .*\*\*\*.*/\1/p' "$log" | sort -u); do
