@@ -1,6 +1,7 @@
 // One group of the page: a summary line, which remains when the group is folded; then its reasons, routers,
 // appliances, and the table of each router beside the wanted one.
 #include "peers/mgmtctl/html_parts.h"
+#include "peers/mgmtctl/reasons.h"
 
 #include <algorithm>
 #include <numeric>
@@ -197,10 +198,8 @@ html_markup connection_badge(const snapshot &shown, const snapshot_group &group,
         return unknown_badge();
     if (group.admin == "down" || is_out_of_its_routers(shown, group))
         return make_badge(style::plain, "not asked");
-    const auto noted = std::find_if(group.reasons.begin(), group.reasons.end(), [&](const auto &each) {
-        return each.sender == router.address && each.count;
-    });
-    return make_badge(style::bad, noted == group.reasons.end() ? "nothing heard" : noted->code);
+    const snapshot_reason *noted = router_reason(shown, group, router);
+    return make_badge(style::bad, noted ? noted->code : "nothing heard");
 }
 
 html_markup table_badge(const snapshot_group &group, const snapshot_router &router) {
