@@ -40,7 +40,7 @@ complains 'mgmtctl: mgmtd is not running (nothing listens at /tmp/gcl-socks/uds-
 expect 3 'jq:.exit == 3 and (.error | startswith("mgmtd is not running"))' --json walk /
 expect 2 '' get
 complains 'mgmtctl: NAME is required*'
-expect 2 '' gte
+expect 2 '' --timeout 5 gte
 complains 'mgmtctl: unknown word "gte"; known are get walk*'
 expect 2 '' set /a=1 /b
 expect 0 'mgmtctl [0-9]*' --version

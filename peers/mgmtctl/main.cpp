@@ -83,11 +83,15 @@ int usage_error(const CLI::App &app, const std::vector<std::string> &arguments, 
     // No command was recognised: the first word is the wrong one.
     if (app.get_subcommands().empty()) {
         error = "a word is missing";
-        for (auto word = arguments.rbegin(); word != arguments.rend(); ++word)
-            if (!word->starts_with('-')) {
+        bool is_value = false; // of the option before it
+        for (auto word = arguments.rbegin(); word != arguments.rend(); ++word) {
+            if (!word->starts_with('-') && !is_value) {
                 error = "unknown word \"" + *word + "\"";
                 break;
             }
+            const CLI::Option *option = app.get_option_no_throw(*word);
+            is_value = option && option->get_items_expected_max() > 0;
+        }
         error += "; known are";
         for (const CLI::App *command : app.get_subcommands([](const CLI::App *) { return true; }))
             if (!command->get_group().empty())
