@@ -181,7 +181,7 @@ void query_and_answer(benchmark::State &state) {
 }
 
 // Many small messages that arrive with one read.
-void burst(benchmark::State &state) {
+void run_burst(benchmark::State &state) {
     answered_session with;
     owned_response msg;
     fill_response(&msg.pointer, 1);
@@ -196,7 +196,7 @@ void burst(benchmark::State &state) {
 BENCHMARK(write_message) SIZES;
 BENCHMARK(read_message) SIZES;
 BENCHMARK(query_and_answer) SIZES->Arg(10000);
-BENCHMARK(burst)->ArgName("messages")->Arg(10)->Arg(1000)->UseManualTime();
+BENCHMARK(run_burst)->ArgName("messages")->Arg(10)->Arg(1000)->UseManualTime();
 
 } // namespace
 

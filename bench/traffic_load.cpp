@@ -58,7 +58,7 @@ constexpr uint16_t DISCARD_PORT = 9;
     fprintf(stderr, "traffic_load: %s: %s\n", what.c_str(), strerror(errno));
     exit(1);
 }
-double now() {
+double now_seconds() {
     timespec time = {};
     clock_gettime(CLOCK_MONOTONIC, &time);
     return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9;
@@ -109,7 +109,7 @@ int run_router(char **words) {
 
 // --- Small packets
 
-void append(std::vector<uint8_t> *to, const void *bytes, size_t length) {
+void append_bytes(std::vector<uint8_t> *to, const void *bytes, size_t length) {
     const auto *first = static_cast<const uint8_t *>(bytes);
     to->insert(to->end(), first, first + length);
 }
@@ -141,10 +141,10 @@ std::vector<uint8_t> small_frame(uint32_t flow, const uint8_t *mac, uint32_t des
     // 02:00:00:00:00:01, a locally administered address.
     const uint8_t source_and_type[] = {2, 0, 0, 0, 0, 1, ETH_P_IP >> 8, ETH_P_IP & 255};
     std::vector<uint8_t> frame;
-    append(&frame, mac, ETH_ALEN);
-    append(&frame, source_and_type, sizeof source_and_type);
-    append(&frame, &ip, sizeof ip);
-    append(&frame, rest.data(), length);
+    append_bytes(&frame, mac, ETH_ALEN);
+    append_bytes(&frame, source_and_type, sizeof source_and_type);
+    append_bytes(&frame, &ip, sizeof ip);
+    append_bytes(&frame, rest.data(), length);
     return frame;
 }
 int open_device(const char *device) {
@@ -182,7 +182,7 @@ int run_packets(char **words) {
         messages[i].msg_hdr.msg_iov = &parts[i];
         messages[i].msg_hdr.msg_iovlen = 1;
     }
-    const double began = now();
+    const double began = now_seconds();
     double time = began;
     uint64_t sent = 0, refused = 0; // refused: by a full queue of the receiver
     while (time - began < seconds) {
@@ -201,7 +201,7 @@ int run_packets(char **words) {
             }
             sent += burst;
         }
-        time = now();
+        time = now_seconds();
     }
     printf("{\"sent\": %llu, \"refused\": %llu, \"seconds\": %.3f}\n", static_cast<unsigned long long>(sent),
            static_cast<unsigned long long>(refused), time - began);
@@ -269,7 +269,7 @@ void note_progress(progress *all, int fd, uint64_t written) {
     if (ioctl(fd, SIOCOUTQ, &waiting) != 0)
         die("SIOCOUTQ");
     const uint64_t acknowledged = written - static_cast<uint64_t>(waiting);
-    const double time = now();
+    const double time = now_seconds();
     all->longest_pause = std::max(all->longest_pause, time - all->at);
     if (acknowledged != all->acknowledged || waiting == 0)
         all->at = time;
@@ -291,10 +291,10 @@ int run_source(char **words) {
     const int fd = connect_to(words[0], words[1]);
     const std::vector<uint8_t> chunk(CHUNK, 'x');
     progress all;
-    const double began = all.at = now();
+    const double began = all.at = now_seconds();
     double looked_at = began;
     uint64_t written = 0;
-    while ((limit == 0 || now() - began < limit) && (size == 0 || written < size)) {
+    while ((limit == 0 || now_seconds() - began < limit) && (size == 0 || written < size)) {
         const size_t length = size ? std::min<uint64_t>(CHUNK, size - written) : CHUNK;
         // Without blocking, so that progress is noted even while nothing moves.
         const ssize_t got = send(fd, chunk.data(), length, MSG_DONTWAIT | MSG_NOSIGNAL);
@@ -305,8 +305,8 @@ int run_source(char **words) {
         pollfd writable = {fd, POLLOUT, 0};
         if (got < 0)
             poll(&writable, 1, 10);
-        if (now() - looked_at > 0.01)
-            note_progress(&all, fd, written), looked_at = now();
+        if (now_seconds() - looked_at > 0.01)
+            note_progress(&all, fd, written), looked_at = now_seconds();
     }
     shutdown(fd, SHUT_WR);
     uint64_t total = 0;
@@ -321,7 +321,7 @@ int run_source(char **words) {
     getsockopt(fd, IPPROTO_TCP, TCP_INFO, &info, &length);
     printf(
         "{\"bytes\": %llu, \"seconds\": %.3f, \"longest_pause\": %.3f, \"mss\": %u, \"retransmitted\": %u}\n",
-        static_cast<unsigned long long>(written), now() - began, all.longest_pause, info.tcpi_snd_mss,
+        static_cast<unsigned long long>(written), now_seconds() - began, all.longest_pause, info.tcpi_snd_mss,
         info.tcpi_total_retrans);
     return 0;
 }

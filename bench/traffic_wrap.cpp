@@ -33,7 +33,7 @@ struct link_request {
 };
 
 constexpr uint8_t R0 = 0, R1 = 1, R2 = 2, R3 = 3, R4 = 4, R5 = 5, PACKET = 6, LENGTH = 7, SUM = 8, FRAME = 10;
-constexpr bpf_insn op(int code, uint8_t to, uint8_t from, int offset, int value) {
+constexpr bpf_insn make_operation(int code, uint8_t to, uint8_t from, int offset, int value) {
     bpf_insn made = {};
     made.code = static_cast<uint8_t>(code);
     made.dst_reg = to & 15;
@@ -42,32 +42,32 @@ constexpr bpf_insn op(int code, uint8_t to, uint8_t from, int offset, int value)
     made.imm = value;
     return made;
 }
-constexpr bpf_insn set(uint8_t to, int value) {
-    return op(BPF_ALU64 | BPF_MOV | BPF_K, to, 0, 0, value);
+constexpr bpf_insn set_register(uint8_t to, int value) {
+    return make_operation(BPF_ALU64 | BPF_MOV | BPF_K, to, 0, 0, value);
 }
-constexpr bpf_insn copy(uint8_t to, uint8_t from) {
-    return op(BPF_ALU64 | BPF_MOV | BPF_X, to, from, 0, 0);
+constexpr bpf_insn copy_register(uint8_t to, uint8_t from) {
+    return make_operation(BPF_ALU64 | BPF_MOV | BPF_X, to, from, 0, 0);
 }
-constexpr bpf_insn with(int operation, uint8_t to, int value) {
-    return op(BPF_ALU64 | operation | BPF_K, to, 0, 0, value);
+constexpr bpf_insn change_register(int operation, uint8_t to, int value) {
+    return make_operation(BPF_ALU64 | operation | BPF_K, to, 0, 0, value);
 }
-constexpr bpf_insn load(uint8_t to, uint8_t from, int offset) {
-    return op(BPF_LDX | BPF_MEM | BPF_W, to, from, offset, 0);
+constexpr bpf_insn load_field(uint8_t to, uint8_t from, int offset) {
+    return make_operation(BPF_LDX | BPF_MEM | BPF_W, to, from, offset, 0);
 }
-constexpr bpf_insn store(int size, int offset, int value) {
-    return op(BPF_ST | BPF_MEM | size, FRAME, 0, offset, value);
+constexpr bpf_insn store_field(int size, int offset, int value) {
+    return make_operation(BPF_ST | BPF_MEM | size, FRAME, 0, offset, value);
 }
-constexpr bpf_insn call(int function) {
-    return op(BPF_JMP | BPF_CALL, 0, 0, 0, function);
+constexpr bpf_insn call_helper(int function) {
+    return make_operation(BPF_JMP | BPF_CALL, 0, 0, 0, function);
 }
 // Stores the lower 16 bits of a register in the frame, in network order.
 constexpr bpf_insn to_wire(uint8_t reg) {
-    return op(BPF_ALU | BPF_END | BPF_TO_BE, reg, 0, 0, 16);
+    return make_operation(BPF_ALU | BPF_END | BPF_TO_BE, reg, 0, 0, 16);
 }
 constexpr bpf_insn store_half(int offset, uint8_t from) {
-    return op(BPF_STX | BPF_MEM | BPF_H, FRAME, from, offset, 0);
+    return make_operation(BPF_STX | BPF_MEM | BPF_H, FRAME, from, offset, 0);
 }
-int word(uint32_t host_order) {
+int wire_word(uint32_t host_order) {
     return static_cast<int>(htonl(host_order));
 }
 
@@ -84,61 +84,61 @@ int load_program() {
     constexpr int constant = 0x4500 + TTL_AND_GRE + (ROUTER >> 16) + (ROUTER & 0xffff) + (APPLIANCE >> 16) +
                              (APPLIANCE & 0xffff); // part of the header's checksum
     bpf_insn code[] = {
-        copy(PACKET, R1),
-        load(R1, PACKET, offsetof(__sk_buff, protocol)),
+        copy_register(PACKET, R1),
+        load_field(R1, PACKET, offsetof(__sk_buff, protocol)),
         // The offsets of all jumps are filled in below.
-        op(BPF_JMP | BPF_JNE | BPF_K, R1, 0, 0, htons(ETH_P_IP)),
-        copy(R1, PACKET),
+        make_operation(BPF_JMP | BPF_JNE | BPF_K, R1, 0, 0, htons(ETH_P_IP)),
+        copy_register(R1, PACKET),
         // The destination address of the packet.
-        set(R2, ETH_HLEN + 16),
-        copy(R3, FRAME),
-        with(BPF_ADD, R3, -4),
-        set(R4, 4),
-        call(BPF_FUNC_skb_load_bytes),
-        op(BPF_JMP | BPF_JNE | BPF_K, R0, 0, 0, 0),
-        load(R1, FRAME, -4),
-        op(BPF_JMP32 | BPF_JNE | BPF_K, R1, 0, 0, word(SERVER)),
-        copy(R1, PACKET),
-        set(R2, WRAPPING),
+        set_register(R2, ETH_HLEN + 16),
+        copy_register(R3, FRAME),
+        change_register(BPF_ADD, R3, -4),
+        set_register(R4, 4),
+        call_helper(BPF_FUNC_skb_load_bytes),
+        make_operation(BPF_JMP | BPF_JNE | BPF_K, R0, 0, 0, 0),
+        load_field(R1, FRAME, -4),
+        make_operation(BPF_JMP32 | BPF_JNE | BPF_K, R1, 0, 0, wire_word(SERVER)),
+        copy_register(R1, PACKET),
+        set_register(R2, WRAPPING),
         // Room between the Ethernet header and the packet.
-        set(R3, BPF_ADJ_ROOM_MAC),
-        set(R4, 0),
-        call(BPF_FUNC_skb_adjust_room),
-        op(BPF_JMP | BPF_JNE | BPF_K, R0, 0, 0, 0),
+        set_register(R3, BPF_ADJ_ROOM_MAC),
+        set_register(R4, 0),
+        call_helper(BPF_FUNC_skb_adjust_room),
+        make_operation(BPF_JMP | BPF_JNE | BPF_K, R0, 0, 0, 0),
         // Includes the new room by now.
-        load(LENGTH, PACKET, offsetof(__sk_buff, len)),
-        with(BPF_SUB, LENGTH, ETH_HLEN),
-        copy(SUM, LENGTH),
-        with(BPF_ADD, SUM, constant),
-        copy(R1, SUM), // folded twice
-        with(BPF_RSH, R1, 16),
-        with(BPF_AND, SUM, 0xffff),
-        op(BPF_ALU64 | BPF_ADD | BPF_X, SUM, R1, 0, 0),
-        copy(R1, SUM),
-        with(BPF_RSH, R1, 16),
-        op(BPF_ALU64 | BPF_ADD | BPF_X, SUM, R1, 0, 0),
-        with(BPF_XOR, SUM, 0xffff),
+        load_field(LENGTH, PACKET, offsetof(__sk_buff, len)),
+        change_register(BPF_SUB, LENGTH, ETH_HLEN),
+        copy_register(SUM, LENGTH),
+        change_register(BPF_ADD, SUM, constant),
+        copy_register(R1, SUM), // folded twice
+        change_register(BPF_RSH, R1, 16),
+        change_register(BPF_AND, SUM, 0xffff),
+        make_operation(BPF_ALU64 | BPF_ADD | BPF_X, SUM, R1, 0, 0),
+        copy_register(R1, SUM),
+        change_register(BPF_RSH, R1, 16),
+        make_operation(BPF_ALU64 | BPF_ADD | BPF_X, SUM, R1, 0, 0),
+        change_register(BPF_XOR, SUM, 0xffff),
         to_wire(SUM),
         to_wire(LENGTH),
-        store(BPF_H, AT, htons(0x4500)),
+        store_field(BPF_H, AT, htons(0x4500)),
         store_half(AT + 2, LENGTH),
-        store(BPF_W, AT + 4, 0),
-        store(BPF_H, AT + 8, htons(TTL_AND_GRE)),
+        store_field(BPF_W, AT + 4, 0),
+        store_field(BPF_H, AT + 8, htons(TTL_AND_GRE)),
         store_half(AT + 10, SUM),
-        store(BPF_W, AT + 12, word(ROUTER)),
-        store(BPF_W, AT + 16, word(APPLIANCE)),
+        store_field(BPF_W, AT + 12, wire_word(ROUTER)),
+        store_field(BPF_W, AT + 16, wire_word(APPLIANCE)),
         // GRE without options, and the redirect header: dynamic service 51, bucket 0.
-        store(BPF_W, AT + 20, word(0x0000883e)),
-        store(BPF_W, AT + 24, word(0x80330000)),
-        copy(R1, PACKET),
-        set(R2, ETH_HLEN),
-        copy(R3, FRAME),
-        with(BPF_ADD, R3, AT),
-        set(R4, WRAPPING),
-        set(R5, 0),
-        call(BPF_FUNC_skb_store_bytes),
-        set(R0, NEXT_PROGRAM), // target of all jumps
-        op(BPF_JMP | BPF_EXIT, 0, 0, 0, 0),
+        store_field(BPF_W, AT + 20, wire_word(0x0000883e)),
+        store_field(BPF_W, AT + 24, wire_word(0x80330000)),
+        copy_register(R1, PACKET),
+        set_register(R2, ETH_HLEN),
+        copy_register(R3, FRAME),
+        change_register(BPF_ADD, R3, AT),
+        set_register(R4, WRAPPING),
+        set_register(R5, 0),
+        call_helper(BPF_FUNC_skb_store_bytes),
+        set_register(R0, NEXT_PROGRAM), // target of all jumps
+        make_operation(BPF_JMP | BPF_EXIT, 0, 0, 0, 0),
     };
     constexpr size_t count = std::size(code);
     for (size_t i = 0; i < count; i++)

@@ -17,7 +17,7 @@ namespace {
 
 constexpr const char *PID_FILE = "/var/run/wccpd.pid";
 
-std::string content(const char *path) {
+std::string read_content(const char *path) {
     std::ostringstream text;
     text << std::ifstream(path).rdbuf();
     return text.str();
@@ -30,13 +30,13 @@ struct DaemonMain : daemon_test {
 TEST_F(DaemonMain, ThePidFile) {
     std::ofstream(PID_FILE) << "an earlier text that is longer than any number";
     EXPECT_EQ(wccpd_pid_init(), LC_OK);
-    EXPECT_EQ(content(PID_FILE), std::to_string(getpid()) + "\n");
+    EXPECT_EQ(read_content(PID_FILE), std::to_string(getpid()) + "\n");
     unlink(PID_FILE);
     std::ofstream("/tmp/precious") << "kept";
     ASSERT_EQ(symlink("/tmp/precious", PID_FILE), 0);
     EXPECT_EQ(wccpd_pid_init(), LC_BAD_FILE);
     EXPECT_EQ(said("Writing /var/run/wccpd.pid: Too many levels of symbolic links"), 1);
-    EXPECT_EQ(content("/tmp/precious"), "kept");
+    EXPECT_EQ(read_content("/tmp/precious"), "kept");
 }
 
 TEST_F(DaemonMain, EncapsulationRanges) {

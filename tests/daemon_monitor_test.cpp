@@ -10,7 +10,7 @@ const std::string STATE = "/qv/wccpd/wccp/srv_grp/state", SYSTEM = "/qv/wccpd/sy
                   NOTHING = "nothing";
 
 // Type and text of the one binding that answers, "uint32 2" for example.
-std::string get(const std::string &name, bool in_walk = false) {
+std::string get_value(const std::string &name, bool in_walk = false) {
     static const std::map<uint32_t, std::string> types = {{bn_type_str, "str "},
                                                           {bn_type_uint32, "uint32 "},
                                                           {bn_type_ipv4addr, "ipv4addr "},
@@ -30,7 +30,7 @@ std::string get(const std::string &name, bool in_walk = false) {
                return bn_binding_get_str(out.last(), bn_attrib_value, 0, nullptr, value);
            });
 }
-std::string children(const std::string &name) {
+std::string child_names(const std::string &name) {
     owner<tstr_array, tstr_array_free> parts, names;
     EXPECT_EQ(bn_binding_name_to_parts(name.c_str(), &parts, nullptr), LC_OK);
     EXPECT_EQ(tstr_array_new(&names, nullptr), LC_OK);
@@ -70,7 +70,7 @@ struct DaemonMonitor : daemon_test {
         group->appliance_view_count++;
     }
     // The text of a node below group 51.
-    static std::string of_51(const std::string &node) { return get(STATE + "/51/" + node); }
+    static std::string of_51(const std::string &node) { return get_value(STATE + "/51/" + node); }
     // "NODE VALUE; NODE VALUE" and so on. Nodes are below group 51, with a dot below the system, with a slash
     // below the state of all groups.
     static void are(const std::string &wanted) {
@@ -80,7 +80,8 @@ struct DaemonMonitor : daemon_test {
             const std::string name = node[0] == '.'   ? SYSTEM + node.substr(1)
                                      : node[0] == '/' ? STATE + node
                                                       : STATE + "/51/" + node;
-            EXPECT_EQ(get(name), wanted.substr(at + node.size() + 1, end - at - node.size() - 1)) << node;
+            EXPECT_EQ(get_value(name), wanted.substr(at + node.size() + 1, end - at - node.size() - 1))
+                << node;
         }
     }
 };
@@ -138,7 +139,7 @@ TEST_F(DaemonMonitor, ParentsAndAbsentNodes) {
     are("/7/oper nothing; /7/debug nothing; /7/appliance/1/weight nothing; /7/router/1/state status 1; "
         "colour nothing; router/1/colour nothing; oper/deeper nothing; router nothing; appliance nothing; "
         "router/1/appliance nothing");
-    EXPECT_EQ(get("/qv/tunneld/system/state/proto_ver"), NOTHING);
+    EXPECT_EQ(get_value("/qv/tunneld/system/state/proto_ver"), NOTHING);
     EXPECT_EQ(said("wccp_get_grp_info failed: 1"), 3);
     EXPECT_EQ(said("MonGet not for wccpd, bailing - /qv/tunneld/system/state/proto_ver"), 1);
 }
@@ -148,8 +149,8 @@ TEST_F(DaemonMonitor, Dumps) {
         EXPECT_TRUE(got.starts_with("str ") && got.find(part) != std::string::npos) << part;
     };
     are(".proto_ver str 2.0; .is_alive str Initializing");
-    holds(get(SYSTEM + "debug_global"), "    WCCP # of groups                 : 1\n");
-    holds(get(SYSTEM + "debug_all"), "WCCP GROUP ID 51 END");
+    holds(get_value(SYSTEM + "debug_global"), "    WCCP # of groups                 : 1\n");
+    holds(get_value(SYSTEM + "debug_all"), "WCCP GROUP ID 51 END");
     holds(of_51("debug"), "WCCP GROUP 51 INFO END");
     holds(of_51("assignment"), "Received router allocation");
     // Too long: the group's own text is cut, the others have no value, and nothing fails.
@@ -161,13 +162,13 @@ TEST_F(DaemonMonitor, Dumps) {
     are("assignment nothing");
     EXPECT_GT(said(".ERR]"), 1);
     engine.log.clear();
-    EXPECT_EQ(get(STATE + "/51/debug", true), cut); // in a walk that is no error
+    EXPECT_EQ(get_value(STATE + "/51/debug", true), cut); // in a walk that is no error
     for (const std::string &each : {STATE + "/51/assignment", SYSTEM + "debug_all"})
-        EXPECT_EQ(get(each, true), NOTHING);
+        EXPECT_EQ(get_value(each, true), NOTHING);
     EXPECT_EQ(said(".ERR]"), 0);
     are(".debug_all nothing");
     EXPECT_GE(said(".ERR]"), 1);
-    holds(get(SYSTEM + "debug_global"), "debug buffer: used");
+    holds(get_value(SYSTEM + "debug_global"), "debug buffer: used");
 }
 
 // None until there is an agreement, then what routers report, then what this appliance has computed.
@@ -219,20 +220,20 @@ TEST_F(DaemonMonitor, ReasonsCountersAndInterfaces) {
     note(group, WCCP_REASON_FORWARDING_NOT_OFFERED, 202);
     wccp_g.seconds += 2;
     wccp_forget_reason(group, WCCP_REASON_PASSWORD_MISMATCH, address(201));
-    EXPECT_EQ(children(STATE + "/51/reason"), "2 ") << "it keeps its place";
+    EXPECT_EQ(child_names(STATE + "/51/reason"), "2 ") << "it keeps its place";
     are("reason/2 str 2; reason/2/code str forwarding-not-offered; reason/2/sender ipv4addr 10.0.0.202; "
         "reason/2/offered str gre; reason/2/wanted str L2; reason/2/count uint32 2; reason/2/first ms 7000; "
         "reason/2/last ms 2000; .reason/1/code str group-unknown");
-    EXPECT_EQ(children(SYSTEM + "reason"), "1 ");
+    EXPECT_EQ(child_names(SYSTEM + "reason"), "1 ");
     are("reason/0/code nothing; reason/40/code nothing; reason/41/code nothing; "
         "reason/4294967297/code nothing; reason/x/code nothing");
-    EXPECT_EQ(children(STATE + "/7/reason"), "");
+    EXPECT_EQ(child_names(STATE + "/7/reason"), "");
     note(group, WCCP_REASON_ROUTER_SILENT, 202);
     note(group, WCCP_REASON_SEND_FAILED, 202);
     wccp_g.seconds += 61; // most reasons that come from packets end when they are not repeated
-    EXPECT_EQ(children(SYSTEM + "reason"), "");
+    EXPECT_EQ(child_names(SYSTEM + "reason"), "");
     are(".reason/1/code nothing; reason/1/code str router-silent");
-    EXPECT_EQ(children(STATE + "/51/reason").size(), 4u);
+    EXPECT_EQ(child_names(STATE + "/51/reason").size(), 4u);
 
     group->start_time = wccp_g.seconds - 9;
     group->rx_icu_failures = 4294967295;
@@ -240,10 +241,10 @@ TEST_F(DaemonMonitor, ReasonsCountersAndInterfaces) {
     are("since ms 9000; pending_acks uint32 0; counter/rx_icu_failures uint32 4294967295; "
         "counter/weight nothing; .interface/lan0/link_downs uint32 3; "
         ".interface/lan0/address ipv4addr 10.0.0.1; .interface/lan1/link_downs nothing");
-    EXPECT_EQ(children(SYSTEM + "interface"), "lan0 ");
+    EXPECT_EQ(child_names(SYSTEM + "interface"), "lan0 ");
     for (const char *word : {"rx_icu_failures ", "rx_removal_failures ", "tx_build_failures ",
                              "tx_link_drops ", "routers_timed_out "})
-        EXPECT_NE(children(STATE + "/51/counter").find(word), std::string::npos) << word;
+        EXPECT_NE(child_names(STATE + "/51/counter").find(word), std::string::npos) << word;
     EXPECT_EQ(said(".ERR]"), 0);
 }
 
@@ -259,7 +260,7 @@ TEST_F(DaemonMonitor, Lists) {
     for (const char *node :
          {"", "/51/router", "/51/router/2/appliance", "/51", "/200/router", "/51/router/1/appliance",
           "/51/appliance", "/7/router", "/51/router/3/appliance"})
-        found += children(STATE + node) + "|";
+        found += child_names(STATE + node) + "|";
     EXPECT_EQ(found, "0 51 200 |1 2 |10.0.0.9 10.0.0.1 |||||||");
     for (const std::string line :
          {"wccp_get_router_list: failed: status=1", "wccp_get_router_appliance_list failed: status=1"})

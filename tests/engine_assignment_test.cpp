@@ -13,12 +13,12 @@ namespace {
 
 using entries = std::vector<wccp_dsg_appliance>;
 
-wccp_dsg_appliance entry(uint32_t last_octets, uint32_t weight, bool up = true) {
+wccp_dsg_appliance dsg_entry(uint32_t last_octets, uint32_t weight, bool up = true) {
     return {.ipa = host(last_octets), .up = up, .weight = static_cast<uint16_t>(weight), .assigned = 0};
 }
 // "1:100 -2:30 1.2:7": the last octets of 10.0.0.1, 10.0.0.2 and 10.0.1.2 with their weights; a minus is
 // down.
-entries parse(const std::string &text) {
+entries parse_entries(const std::string &text) {
     std::istringstream words(text);
     entries found;
     for (std::string word; words >> word;) {
@@ -28,7 +28,7 @@ entries parse(const std::string &text) {
             third = 0;
             EXPECT_EQ(sscanf(number, "%u:%u", &fourth, &weight), 2) << word;
         }
-        found.push_back(entry(third << 8 | fourth, weight, word[0] != '-'));
+        found.push_back(dsg_entry(third << 8 | fourth, weight, word[0] != '-'));
     }
     return found;
 }
@@ -78,7 +78,7 @@ TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
         {"200:2 100:1 1:1", 256, "200:128 1:64 100:64"},
         {"100:1 1:1 200:2", 256, "100:64 200:128 1:64"}};
     for (const auto &[given, slots, runs] : cases) {
-        entries list = parse(given);
+        entries list = parse_entries(given);
         std::vector<be32> table(slots, host(77));
         wccp_compute_assignment_table(static_cast<uint32_t>(list.size()), list.data(), slots, table.data(),
                                       0);
@@ -144,7 +144,7 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
         for (uint32_t i = 0, count = 1 + random(32); i < count; i++) {
             const uint32_t weights[] = {0, 65535, random(65536)};
             appliances.push_back(
-                entry(random(256) << 8 | (i * 8 + random(8)), weights[std::min(random(4), 2u)]));
+                dsg_entry(random(256) << 8 | (i * 8 + random(8)), weights[std::min(random(4), 2u)]));
             if (i == 0 || random(3)) {
                 staying.push_back(appliances.back());
                 weight += appliances.back().weight;
@@ -166,12 +166,12 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
 
 TEST_F(AssignmentTest, AnApplianceThatLeavesIsDownForOneComputation) {
     group->assign_method = WCCP_ASSIGN_NONE;
-    compute(parse("3:100 1:100 2:100"));
+    compute(parse_entries("3:100 1:100 2:100"));
     EXPECT_TRUE(group->bucket_count == 0 && is_zero(group->bucket_ipa[0])); // no method agreed
     EXPECT_EQ(group->dsg_active_count, 3u);
 
     group->assign_method = WCCP_ASSIGN_HASH;
-    compute(parse("3:100 1:100 2:100"));
+    compute(parse_entries("3:100 1:100 2:100"));
     // Entries are in order of arrival, runs in sorted order.
     EXPECT_EQ(group->dsg_appliances[0].ipa, host(3));
     EXPECT_EQ(std::tuple(group->bucket_index[0], group->bucket_index[85], group->bucket_index[255],
@@ -183,7 +183,7 @@ TEST_F(AssignmentTest, AnApplianceThatLeavesIsDownForOneComputation) {
         {"1:100 3:100", "1:128 3:128", 128},
         {"1:300 3:100", "1:192 3:64", 64}}; // a new weight
     for (const auto &[appliances, slots, of_3] : rounds) {
-        compute(parse(appliances));
+        compute(parse_entries(appliances));
         EXPECT_EQ(runs(), slots);
         EXPECT_EQ(std::tuple(group->dsg_appliance_count, group->dsg_active_count, group->bucket_index[0],
                              group->dsg_appliances[0].assigned),
@@ -200,8 +200,8 @@ TEST_F(AssignmentTest, DownEntriesAreDroppedWhenThereIsNoRoom) {
     entries first, second, third;
     for (uint32_t i = 1; i <= 32; i++) {
         // The light ones have no slots, so they are dropped first.
-        first.push_back(entry(i, i <= 10 ? 1 : 6000));
-        second.push_back(entry(i + 50, 100));
+        first.push_back(dsg_entry(i, i <= 10 ? 1 : 6000));
+        second.push_back(dsg_entry(i + 50, 100));
         if (i > 20)
             third.push_back(first.back());
     }
@@ -215,7 +215,7 @@ TEST_F(AssignmentTest, DownEntriesAreDroppedWhenThereIsNoRoom) {
     compute(second); // all but 20 are replaced
     ASSERT_EQ(group->dsg_active_count, 32u);
     EXPECT_EQ(runs().substr(0, 4), "51:8");
-    second.push_back(entry(99, 100)); // more than possible: the last one is left out
+    second.push_back(dsg_entry(99, 100)); // more than possible: the last one is left out
     compute(second);
     EXPECT_TRUE(group->dsg_active_count == 32 && !is_active(host(99)));
 
@@ -225,10 +225,10 @@ TEST_F(AssignmentTest, DownEntriesAreDroppedWhenThereIsNoRoom) {
     group->assign_method = WCCP_ASSIGN_HASH;
     entries appliances;
     for (uint32_t i = 1; i <= 32; i++)
-        appliances.push_back(entry(i, i == 5 ? 10 : 100));
+        appliances.push_back(dsg_entry(i, i == 5 ? 10 : 100));
     compute(appliances);
     appliances.erase(appliances.begin() + 4, appliances.begin() + 6);
-    appliances.push_back(entry(40, 0));
+    appliances.push_back(dsg_entry(40, 0));
     compute(appliances);
     const std::string text = runs();
     EXPECT_GE(std::count(text.begin(), text.end(), ':'), 30 + 6);
@@ -285,7 +285,7 @@ TEST_F(MaskTest, SevenBitsAreUsedAndEightReplaced) {
 
 TEST_F(MaskTest, ValuesAreSharedLikeBuckets) {
     values_of({0, 0xF00, 0, 0});
-    compute(parse("3:100 2:100 1:100"));
+    compute(parse_entries("3:100 2:100 1:100"));
     EXPECT_EQ(runs(), "1:5 2:5 3:6");
     for (uint32_t i = 0; i < 16; i++)
         EXPECT_EQ(group->mask_values[i].appliance_ipa, group->bucket_ipa[i]);
@@ -296,7 +296,7 @@ TEST_F(MaskTest, ValuesAreSharedLikeBuckets) {
     EXPECT_EQ(group->dsg_appliances[0].assigned, 6);
 
     values_of({}); // one value, which the last appliance in order gets
-    compute(parse("1:100 2:100"));
+    compute(parse_entries("1:100 2:100"));
     EXPECT_EQ(runs(), "2:1");
     EXPECT_EQ(group->mask_values[0].appliance_ipa, host(2));
 }

@@ -40,7 +40,7 @@ dump dump_of(uint32_t size, const std::function<int(csys_display_buf *)> &print)
     const int result = print(buffer);
     return {result, csys_display_buf_text(buffer), csys_display_buf_bytes_max(buffer)};
 }
-std::string closed(const std::string &text, uint32_t max) {
+std::string closed_text(const std::string &text, uint32_t max) {
     return text + "    (debug buffer: used " + std::to_string(text.size()) + " max len " +
            std::to_string(max) + ")\n";
 }
@@ -132,7 +132,7 @@ TEST_F(EngineDump, TheWholeTexts) {
     const auto matches = [](uint32_t size, int (*print)(csys_display_buf *), const std::string &text) {
         const dump found = dump_of(size, print);
         EXPECT_EQ(found.result, 0);
-        EXPECT_EQ(found.text, closed(text, found.max));
+        EXPECT_EQ(found.text, closed_text(text, found.max));
     };
     matches(WCCP_DUMP_GROUP_BYTES, print_51, begin + GROUP_TEXT + middle + HASH_TEXT + STATS_TEXT + end);
     matches(WCCP_DUMP_GLOBAL_BYTES, wccp_print_global, GLOBAL_TEXT);

@@ -31,7 +31,7 @@ extern "C" int poll(pollfd *fds, nfds_t count, int wait_ms) {
 
 namespace {
 
-int option(int fd, int name) {
+int option_of(int fd, int name) {
     int value = 0;
     socklen_t length = sizeof value;
     EXPECT_EQ(getsockopt(fd, IPPROTO_IP, name, &value, &length), 0);
@@ -103,9 +103,10 @@ TEST_F(Network, NoAddressMeansNoSocketsAndNoThread) {
 TEST_F(Network, SocketsCarryTheirOptions) {
     EXPECT_EQ(bound_to(wan->ucast_fd) + " " + bound_to(wan->mcast_fd), "10.0.0.100:2048 0.0.0.0:0");
     for (const int fd : {wan->ucast_fd, wan->mcast_fd})
-        EXPECT_EQ(option(fd, IP_MTU_DISCOVER), IP_PMTUDISC_DONT);
-    EXPECT_EQ(std::tuple(option(wan->mcast_fd, IP_MULTICAST_TTL), option(wan->mcast_fd, IP_MULTICAST_LOOP),
-                         static_cast<uint32_t>(option(wan->mcast_fd, IP_MULTICAST_IF))),
+        EXPECT_EQ(option_of(fd, IP_MTU_DISCOVER), IP_PMTUDISC_DONT);
+    EXPECT_EQ(std::tuple(option_of(wan->mcast_fd, IP_MULTICAST_TTL),
+                         option_of(wan->mcast_fd, IP_MULTICAST_LOOP),
+                         static_cast<uint32_t>(option_of(wan->mcast_fd, IP_MULTICAST_IF))),
               std::tuple(5, 0, address_word("10.0.0.100")));
 }
 
@@ -276,11 +277,11 @@ TEST_F(Network, TheTtlIsSetOnEverySocket) {
     EXPECT_EQ(wccp_set_mcast_ttl(5), 0) << "unchanged: no socket is touched";
     EXPECT_EQ(wccp_set_mcast_ttl(0x1ff), 1);
     for (const wccp_interface *each : {wan, last})
-        EXPECT_EQ(option(each->mcast_fd, IP_MULTICAST_TTL), 255);
+        EXPECT_EQ(option_of(each->mcast_fd, IP_MULTICAST_TTL), 255);
     EXPECT_TRUE(wccp_g.mcast_ttl == 255 && closed->mcast_fd == -1);
     wccp_close_sockets(bad);
     EXPECT_TRUE(wccp_set_mcast_ttl(0) == 0 && wccp_g.mcast_ttl == 33);
-    ASSERT_TRUE(wccp_init_network_by_interface(wan) == 0 && option(wan->mcast_fd, IP_MULTICAST_TTL) == 33);
+    ASSERT_TRUE(wccp_init_network_by_interface(wan) == 0 && option_of(wan->mcast_fd, IP_MULTICAST_TTL) == 33);
 }
 
 TEST_F(Network, APacketIsSentToTheDestinationsOfTheGroup) {

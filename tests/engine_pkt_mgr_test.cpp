@@ -14,16 +14,17 @@ namespace {
 using bytes = std::vector<uint8_t>;
 using numbers = std::vector<uint32_t>;
 
-be32 ipa(uint8_t third, uint8_t fourth) {
+be32 make_ipa(uint8_t third, uint8_t fourth) {
     return {{10, 0, third, fourth}};
 }
-const be32 SENDER = ipa(0, 1);
+const be32 SENDER = make_ipa(0, 1);
 
 const wire_bytes security = security_info();
-wire_bytes service(uint32_t id = 51, uint32_t priority = 200, uint32_t protocol = 6, uint32_t flags = 0x13) {
+wire_bytes service_part(uint32_t id = 51, uint32_t priority = 200, uint32_t protocol = 6,
+                        uint32_t flags = 0x13) {
     return service_info(id, priority, protocol, flags);
 }
-wire_bytes identity(uint32_t router, uint32_t receive_id = 0xa1a2a3a4) {
+wire_bytes identity_part(uint32_t router, uint32_t receive_id = 0xa1a2a3a4) {
     return router_identity(host(router), host(100), receive_id);
 }
 struct element {
@@ -45,7 +46,7 @@ wire_bytes mask_view(uint32_t router, const std::vector<uint32_t> &ids) {
         out.ip(0, id).hex("0000 0002 00000000 0064 0000");
     return out.put16(2, static_cast<uint32_t>(out.size() - 4));
 }
-wire_bytes map(const std::vector<uint32_t> &ids) {
+wire_bytes map_part(const std::vector<uint32_t> &ids) {
     wire_bytes out = hex("000e 0000 00000001 00001741 00000f00 0001 0002");
     out.u32(static_cast<uint32_t>(ids.size()));
     for (const uint32_t id : ids)
@@ -56,14 +57,14 @@ const wire_bytes by_hash = capability_info(2, 1, 2), by_mask = capability_info(2
                  odd_unknown = hex("0063 0003 eeeeee"),
                  odd_command = hex("000f 000d 0001 0004 0a000001 ee*5");
 
-bytes icu(uint32_t router, const wire_bytes &its_view, const std::vector<wire_bytes> &more = {by_hash}) {
-    std::vector<wire_bytes> components = {security, service(), identity(router), its_view};
+bytes make_icu(uint32_t router, const wire_bytes &its_view, const std::vector<wire_bytes> &more = {by_hash}) {
+    std::vector<wire_bytes> components = {security, service_part(), identity_part(router), its_view};
     components.insert(components.end(), more.begin(), more.end());
     return wire_message(11, components);
 }
-bytes query(uint32_t router, uint32_t target) {
-    return wire_message(
-        13, {security, service(), hex("0007 0010").ip(0, router).hex("00000099 0a000064").ip(0, target)});
+bytes make_query(uint32_t router, uint32_t target) {
+    return wire_message(13, {security, service_part(),
+                             hex("0007 0010").ip(0, router).hex("00000099 0a000064").ip(0, target)});
 }
 
 struct Messages : testing::Test {
@@ -78,7 +79,7 @@ struct Messages : testing::Test {
     static int process(const bytes &message, be32 from = SENDER) {
         return wccp_process_received_packet(make_received(message, from).get());
     }
-    wccp_sending_router *router(uint8_t id) const { return wccp_find_sending_router(group, ipa(0, id)); }
+    wccp_sending_router *router(uint8_t id) const { return wccp_find_sending_router(group, make_ipa(0, id)); }
     engine_fixture engine;
     wccp_service_group *group = nullptr;
 };
@@ -90,15 +91,15 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
                               icu_alone = {0, 0, 1, 0, 0, 0, 0, 0}, bad_icu = {0, 0, 1, 1, 0, 0, 0, 0},
                               bad_service = {0, 0, 1, 1, 0, 0, 0, 1}, query_alone = {0, 0, 0, 0, 1, 0, 0, 0},
                               bad_query = {0, 0, 0, 0, 1, 1, 0, 0};
-    const bytes good = icu(1, view(1, {{100, 100, 0}}));
+    const bytes good = make_icu(1, view(1, {{100, 100, 0}}));
     const auto changed = [&good](size_t at, uint8_t value) {
         bytes out = good;
         out.at(at) = value;
         return out;
     };
     const auto with = [](const std::vector<wire_bytes> &components) { return wire_message(11, components); };
-    const auto optional = [](const std::vector<wire_bytes> &more) { return icu(1, view(1, {}), more); };
-    bytes longer = good, router_0 = icu(0, view(1, {}));
+    const auto optional = [](const std::vector<wire_bytes> &more) { return make_icu(1, view(1, {}), more); };
+    bytes longer = good, router_0 = make_icu(0, view(1, {}));
     longer.push_back(0);
     memset(&router_0[8 + 8 + 28 + 4], 0, 4);
     const struct {
@@ -120,20 +121,24 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {changed(0, 1), 0, none, "10.0.0.1", "message-type"}, // a type of more than 16 bits
         {with({}), 1, all, "WCCP: unloading security info failed."},
         {with({security}), 1, all, "WCCP: unloading service info failed."},
-        {with({security, service(52)}), 1, all, "WCCP GRP 52: rxed service group (52) is not configured.",
-         "group-unknown 10.0.0.1: group 52|"},
+        {with({security, service_part(52)}), 1, all,
+         "WCCP GRP 52: rxed service group (52) is not configured.", "group-unknown 10.0.0.1: group 52|"},
         {changed(15, 2), 1, bad_option, "WCCP GRP 51: rxed mismatch security opt: 2 configured opt: 0",
          "security-unwanted 10.0.0.1: option 2|none"},
-        {with({security, service()}), 0, bad_icu, "WCCP: unloading router identity failed."},
-        {with({security, service(), identity(1)}), 0, bad_icu, "WCCP: unloading router view failed."},
-        {with({security, service(51, 201, 17, 3), identity(1)}), 0, bad_service,
+        {with({security, service_part()}), 0, bad_icu, "WCCP: unloading router identity failed."},
+        {with({security, service_part(), identity_part(1)}), 0, bad_icu,
+         "WCCP: unloading router view failed."},
+        {with({security, service_part(51, 201, 17, 3), identity_part(1)}), 0, bad_service,
          "WCCP GRP 51: service group config mismatch (router id: 10.0.0.1) .priority: rxed = 201 local = "
          "200, protocol: rxed = 17 local = 6, service flags: rxed = 0x3 local =  0x13",
          "service-mismatch 10.0.0.1: priority 201, protocol 17, flags 0x3|priority 200, protocol 6, flags "
          "0x13"},
-        {with({security, service(51, 199), identity(1)}), 0, bad_service, "config mismatch", "service-"},
-        {with({security, service(51, 200, 17), identity(1)}), 0, bad_service, "mismatch", "service-"},
-        {with({security, service(51, 200, 6, 0x80000013), identity(1)}), 0, bad_service, "config mismatch"},
+        {with({security, service_part(51, 199), identity_part(1)}), 0, bad_service, "config mismatch",
+         "service-"},
+        {with({security, service_part(51, 200, 17), identity_part(1)}), 0, bad_service, "mismatch",
+         "service-"},
+        {with({security, service_part(51, 200, 6, 0x80000013), identity_part(1)}), 0, bad_service,
+         "config mismatch"},
         {optional({hex("000e 0000")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {optional({hex("000f 0000")}), 0, bad_icu, "WCCP: unloading command ext comp. failed."},
         {optional({hex("0008 0004 00000000")}), 0, bad_icu, "WCCP: unloading capability comp. failed."},
@@ -149,10 +154,11 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {optional({capability_info(2, 1, 0)}), 0, bad_icu, "incompatible capabilities",
          "return-not-offered 10.0.0.1: none|gre or L2"},
         {router_0, 0, icu_alone, "", "router-id-zero: |"},
-        {wire_message(13, {security, service()}), 0, bad_query, "WCCP: unloading router query failed."},
-        {query(1, 100), 0, query_alone, "removal query request. cannot find router. (router id 10.0.0.1)",
+        {wire_message(13, {security, service_part()}), 0, bad_query, "WCCP: unloading router query failed."},
+        {make_query(1, 100), 0, query_alone,
+         "removal query request. cannot find router. (router id 10.0.0.1)",
          "query-refused 10.0.0.1: a query before an I-See-You|"},
-        {query(1, 101), 0, query_alone,
+        {make_query(1, 101), 0, query_alone,
          "not for us. sending router id: 10.0.0.1 target appliance: 10.0.0.101", ""},
     };
     const auto now = [this] {
@@ -218,7 +224,7 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
     lc_log_set_daemon_log_level(LC_LOG_INFO);
     {
         const wccp_complaint_scope complaints(wan0);
-        EXPECT_EQ(process(icu(1, view(1, {}))), 0);
+        EXPECT_EQ(process(make_icu(1, view(1, {}))), 0);
     }
     EXPECT_TRUE(log.say("created ICU sending router")) << "which is not a complaint";
     lc_log_set_daemon_log_level(LC_LOG_WARNING);
@@ -235,7 +241,7 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
 TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
     const auto report = [](uint32_t id, uint32_t weight, std::vector<element> seen = {}) {
         seen.push_back({100, weight, 0});
-        return icu(id, view(id, seen), {by_mask});
+        return make_icu(id, view(id, seen), {by_mask});
     };
     process(report(1, 100));
     process(report(2, 100));
@@ -252,12 +258,12 @@ TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
         {"failed to add tunnel",
          [this](uint32_t i) {
              group->ret_method = WCCP_METHOD_GRE;
-             return icu(3 + i % 60, view(3, {}), {capability_info(2, 2, 1)});
+             return make_icu(3 + i % 60, view(3, {}), {capability_info(2, 2, 1)});
          }},
         {"here-i-am: loading web-cache view info failed.",
          [this](uint32_t) {
              group->appliance_view_count = 1000; // more than exist
-             return query(1, 100);
+             return make_query(1, 100);
          }},
     };
     log_lines log;
@@ -279,9 +285,9 @@ TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
 }
 
 TEST_F(Messages, ATruncatedISeeYouLeavesTheGroupUnchanged) {
-    process(icu(2, view(2, {{100, 100, 0xff}})));
+    process(make_icu(2, view(2, {{100, 100, 0xff}})));
     const wire_bytes seen = view(1, {{100, 100, 0x11}, {101, 50, 0x22}});
-    const bytes whole = icu(1, seen, {by_hash, odd_command, map({100, 101})});
+    const bytes whole = make_icu(1, seen, {by_hash, odd_command, map_part({100, 101})});
     const size_t mandatory = 8 + 8 + 28 + 24 + seen.size();
     size_t refused = 0;
     for (size_t length = 44; length < whole.size(); length++) {
@@ -310,7 +316,7 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
     constexpr uint32_t L2 = WCCP_METHOD_L2, HASH = WCCP_ASSIGN_HASH;
     const wire_bytes seen = view(1, {{100, 100, 0x01}, {101, 50, 0xff}}, 5);
     // Odd lengths put the capabilities at odd addresses.
-    EXPECT_EQ(process(icu(1, seen, {odd_unknown, odd_command, by_hash}), ipa(7, 7)), 0);
+    EXPECT_EQ(process(make_icu(1, seen, {odd_unknown, odd_command, by_hash}), make_ipa(7, 7)), 0);
     EXPECT_EQ(take_reasons(group), "");
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
@@ -323,18 +329,20 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
                        group->rx_icu_failures};
     };
     EXPECT_EQ(now(), (numbers{0xa1a2a3a4, 0xc1c2c3c4, 77, 1, 2, 32, 256, L2, HASH, 0, 0}));
-    EXPECT_EQ(made->src_ipa, ipa(7, 7));
+    EXPECT_EQ(made->src_ipa, make_ipa(7, 7));
     EXPECT_TRUE(made->flags & WCCP_RTR_TWO_WAY && group->state_flags & WCCP_STATE_ACTIVE);
     // Another service is only counted.
     wccp_g.seconds = 78;
-    EXPECT_EQ(process(wire_message(11, {security, service(51, 1), identity(1, 9), view(1, {})})), 0);
+    EXPECT_EQ(process(wire_message(11, {security, service_part(51, 1), identity_part(1, 9), view(1, {})})),
+              0);
     EXPECT_EQ(now(), (numbers{9, 0xc1c2c3c4, 78, 1, 0, 0, 0, L2, HASH, 1, 0}));
 }
 
 TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     // 102 is not in the view, and the view has 100 twice.
     const std::vector<uint32_t> owners = {100, 100, 101, 102, 102, 100, 101, 101, 101, 100};
-    EXPECT_EQ(process(icu(1, mask_view(1, {100, 101, 100}), {odd_unknown, map(owners), by_mask})), 0);
+    EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101, 100}), {odd_unknown, map_part(owners), by_mask})),
+              0);
     EXPECT_EQ(take_reasons(group),
               "mask-differs 10.0.0.1: src 0x1741 dst 0xf00 ports 0x1 0x2|src 0x0 dst 0x0 "
               "ports 0x0 0x0");
@@ -363,16 +371,16 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
         for (const uint32_t value : values) // one bit of the source and one of the destination
             ordered.u32(value >> 16).u32(value & 0x100).u32(0).ip(0, 101);
         ordered.put16(2, static_cast<uint32_t>(ordered.size() - 4));
-        EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {ordered})), 0);
+        EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101}), {ordered})), 0);
         EXPECT_EQ(made->map_in_order, in_order);
     }
-    EXPECT_EQ(process(icu(1, mask_view(1, {100, 101}), {map({101, 100})})), 0);
+    EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101}), {map_part({101, 100})})), 0);
     EXPECT_TRUE(bits(0) == 0b10 && bits(1) == 0b01 && made->self_buckets == 1 && !made->map_in_order);
 
     // A map without mask elements is refused, alone or after a full one, after the views have been updated.
     const wire_bytes empty = hex("000e 0024 00000000"), rest = hex("0063 001c").zeros(28);
-    const bytes messages[] = {icu(1, mask_view(1, {100}), {empty, rest}),
-                              icu(1, mask_view(1, {100, 101}), {map({100, 100}), empty, rest})};
+    const bytes messages[] = {make_icu(1, mask_view(1, {100}), {empty, rest}),
+                              make_icu(1, mask_view(1, {100, 101}), {map_part({100, 100}), empty, rest})};
     for (uint32_t i = 0; i < 2; i++) {
         EXPECT_EQ(process(messages[i]), 0);
         EXPECT_TRUE(group->rx_icu_failures == i + 1 && made->view_appliance_count == i + 1 &&
@@ -381,18 +389,18 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
 
     // Hash elements when mask was agreed.
     take_reasons(group);
-    process(icu(2, view(2, {{101, 50, 0xff}}), {by_mask}));
+    process(make_icu(2, view(2, {{101, 50, 0xff}}), {by_mask}));
     EXPECT_EQ(take_reasons(group), "method-differs 10.0.0.2: hash by the router|mask x2; "
                                    "not-in-view 10.0.0.2: 1 appliance|10.0.0.100");
 }
 
 TEST_F(Messages, AMapThatFillsThePacketIsProcessed) {
-    const size_t room = WCCP_MAX_PACKET - icu(1, mask_view(1, {100, 101}), {by_mask}).size() - 24;
+    const size_t room = WCCP_MAX_PACKET - make_icu(1, mask_view(1, {100, 101}), {by_mask}).size() - 24;
     std::vector<uint32_t> owners(room / 16 - 1, 101);
     owners.back() = 100;
     const size_t rest = room - owners.size() * 16 - 4;
     const wire_bytes filler = hex("0063").u16(static_cast<uint32_t>(rest)).zeros(rest);
-    bytes message = icu(1, mask_view(1, {100, 101}), {by_mask, map(owners), filler});
+    bytes message = make_icu(1, mask_view(1, {100, 101}), {by_mask, map_part(owners), filler});
     ASSERT_EQ(message.size(), size_t{WCCP_MAX_PACKET});
     ASSERT_TRUE(process(message) == 0 && router(1));
     EXPECT_EQ(std::tuple(router(1)->self_buckets, router(1)->total_buckets, group->rx_icu_failures),
@@ -403,7 +411,7 @@ TEST_F(Messages, AMapThatFillsThePacketIsProcessed) {
 
 TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
     const auto report = [](uint32_t id, uint32_t key, uint32_t address = 100) {
-        process(icu(id, view(id, {{100, 100, 0}}, key, address)));
+        process(make_icu(id, view(id, {{100, 100, 0}}, key, address)));
     };
     report(1, 0);
     report(2, 0);
@@ -440,15 +448,15 @@ TEST_F(Messages, TheDigestDecides) {
     memcpy(group->password, "secret\0", 8);
     // Computed by md5sum over the 8 bytes of the password and the message with a zero digest.
     const wire_bytes signature = hex("0000 0014 00000001 3f928e4227816919a09d11fd2b70f0f2");
-    const bytes good = wire_message(
-        11, {signature, service(), identity(1), view(1, {{100, 100, 0}}, 7), capability_info(2, 3, 2)});
+    const bytes good = wire_message(11, {signature, service_part(), identity_part(1),
+                                         view(1, {{100, 100, 0}}, 7), capability_info(2, 3, 2)});
     EXPECT_TRUE(process(good) == 0 && router(1));
     for (const size_t at : {size_t{16}, size_t{31}, size_t{40}, good.size() - 1}) {
         bytes changed = good;
         changed[at] ^= 1;
         EXPECT_EQ(process(changed), 1) << at;
     }
-    EXPECT_EQ(process(icu(1, view(1, {}))), 1) << "no security although it is configured";
+    EXPECT_EQ(process(make_icu(1, view(1, {}))), 1) << "no security although it is configured";
     memcpy(group->password, "secreT\0", 8);
     EXPECT_EQ(process(good), 1);
     group->security_option = 0;
@@ -457,15 +465,15 @@ TEST_F(Messages, TheDigestDecides) {
                                 "security-unwanted 10.0.0.1: MD5|none";
     EXPECT_EQ(take_reasons(group), reasons);
     // An accepted I-See-You ends them, except those of the same second and those of other senders.
-    EXPECT_TRUE(process(good) == 1 && process(good, ipa(0, 2)) == 1);
+    EXPECT_TRUE(process(good) == 1 && process(good, make_ipa(0, 2)) == 1);
     for (uint32_t second = 0; second < 2; second++, wccp_g.seconds++)
-        process(icu(1, view(1, {{100, 100, 0}})));
+        process(make_icu(1, view(1, {{100, 100, 0}})));
     EXPECT_EQ(take_reasons(group),
               "security-unwanted 10.0.0.2: MD5|none; assignment-not-offered 10.0.0.1: hash|mask x2");
     // Reasons of strangers replace those of strangers, not those of the group's routers.
     EXPECT_EQ(process(good), 1);
     for (uint8_t i = 0; i < 100; i++, wccp_g.seconds++)
-        process(good, ipa(7, i));
+        process(good, make_ipa(7, i));
     const std::string all = take_reasons(group);
     EXPECT_EQ(count_of("unwanted 10.0.0.1: ", all) + count_of("10.0.7.99:", all), 2) << all;
     EXPECT_EQ(count_of("10.0.7.0:", all), 0) << all;

@@ -231,7 +231,8 @@ struct decoded_elements {
     int result = -1;
 };
 // Without the last `cut` bytes.
-decoded_elements decode(wccp_service_group *group, const std::vector<wire_bytes> &elements, size_t cut = 0) {
+decoded_elements decode_elements(wccp_service_group *group, const std::vector<wire_bytes> &elements,
+                                 size_t cut = 0) {
     group->appliance_ipa = OURS;
     decoded_elements out;
     wire_bytes all; // at an odd address, without a byte to spare
@@ -253,7 +254,7 @@ TEST_F(Unload, ElementsAreDecodedByTheirForm) {
         hash_form(3, 7, full, WCCP_IDENTITY_HISTORICAL),
         element(4, 0, 3, wire_bytes().zeros(20), 44),
     };
-    const decoded_elements out = decode(&group, elements);
+    const decoded_elements out = decode_elements(&group, elements);
     ASSERT_EQ(out.result, 0);
     EXPECT_TRUE(out.hash.valid == 1 && out.hash.self_count == 10 &&
                 out.hash.total_count == 256); // 266, limited
@@ -265,12 +266,13 @@ TEST_F(Unload, ElementsAreDecodedByTheirForm) {
                   expected[i]);
     }
     EXPECT_TRUE(out.list[0].bucket_bits[0] == 0x80010000 && out.list[0].bucket_bits[1] == 0xff000000);
-    EXPECT_EQ(decode(&group, {}).result + decode(&group, {}).hash.total_count, 0);
+    EXPECT_EQ(decode_elements(&group, {}).result + decode_elements(&group, {}).hash.total_count, 0);
     // Another hash revision is refused, historical or not, and so are truncated elements and null arguments.
-    EXPECT_EQ(decode(&group, {hash_form(1, 100, full), hash_form(2, 1, full, 0x80, 1)}).result, 1);
+    EXPECT_EQ(decode_elements(&group, {hash_form(1, 100, full), hash_form(2, 1, full, 0x80, 1)}).result, 1);
     for (const wire_bytes &last : elements)
         for (size_t cut = 3; cut <= last.size(); cut++) // the last two bytes, the status, are not read
-            EXPECT_EQ(decode(&group, {elements[3], last}, cut).result, 1) << last.size() << " - " << cut;
+            EXPECT_EQ(decode_elements(&group, {elements[3], last}, cut).result, 1)
+                << last.size() << " - " << cut;
     decoded_elements none;
     EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(nullptr, 0, {}, none.list, &none.hash), 1);
     EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(&group, 0, {}, nullptr, &none.hash), 1);
@@ -282,7 +284,7 @@ TEST_F(Unload, AMaskElementWithRedirectLeavesTheAssignmentToTheMap) {
         group.compat_mode = mode;
         const wire_bytes middle = wire_bytes().zeros(mode == WCCP_COMPAT_IOS ? 4 : 20);
         const decoded_elements out =
-            decode(&group, {element(1, 0, 2, middle, 77), hash_form(2, 100, hex("01"))});
+            decode_elements(&group, {element(1, 0, 2, middle, 77), hash_form(2, 100, hex("01"))});
         ASSERT_EQ(out.result, 0);
         EXPECT_TRUE(out.hash.valid == 0 && out.list[0].weight == 77 && out.list[1].buckets_assigned == 1);
         EXPECT_EQ(out.list[1].ipa, (be32{{10, 0, 0, 2}}));
@@ -299,7 +301,7 @@ TEST_F(Unload, BucketBitsAreCountedWhateverTheirPattern) {
             buckets.u8(round % 3 == 0 ? state >> 24 | state >> 16 : state >> 24);
             expected += std::popcount(buckets.bytes.back());
         }
-        ASSERT_EQ(decode(&group, {hash_form(1, 1, buckets)}).list[0].buckets_assigned, expected);
+        ASSERT_EQ(decode_elements(&group, {hash_form(1, 1, buckets)}).list[0].buckets_assigned, expected);
     }
 }
 

@@ -22,7 +22,7 @@ using steady = std::chrono::steady_clock;
 namespace {
 
 template <typename Condition>
-bool soon(Condition condition, std::chrono::milliseconds limit = 5s) {
+bool becomes_true(Condition condition, std::chrono::milliseconds limit = 5s) {
     const auto end = steady::now() + limit;
     while (!condition() && steady::now() < end)
         std::this_thread::sleep_for(2ms);
@@ -112,8 +112,9 @@ TEST_F(Threads, BridgeModeWhileReceiversWaitForTheLock) {
     add_group(62, "wan1");
     start_timer_thread();
     see_you(first, 61, "10.1.0.2", "10.1.0.1");
-    ASSERT_TRUE(soon([] { return router_count(61) == 1; }));
-    ASSERT_TRUE(soon([] { return threads_named("WCCP_") == 3; })); // a thread names itself when it first runs
+    ASSERT_TRUE(becomes_true([] { return router_count(61) == 1; }));
+    ASSERT_TRUE(
+        becomes_true([] { return threads_named("WCCP_") == 3; })); // a thread names itself when it first runs
 
     tunneld->answer_with(tunneld_is_silent);
     std::atomic<bool> stopped = false;
@@ -151,7 +152,7 @@ TEST_F(Threads, BridgeModeUnderAFlood) {
     for (int round = 0; round < 30; round++) {
         add_group(61, "wan0");
         wccp_interface *wan = wccp_if_find_interface("wan0");
-        ASSERT_TRUE(soon([] { return router_count(61) > 0; }));
+        ASSERT_TRUE(becomes_true([] { return router_count(61) > 0; }));
         EXPECT_EQ(wccp_system_mode_change_event("bridge"), 0);
         EXPECT_TRUE(router_count(61) == 0 && lock_is_free());
         wccp_del_group(61);
@@ -159,7 +160,7 @@ TEST_F(Threads, BridgeModeUnderAFlood) {
     }
     over = true;
     flood.join();
-    EXPECT_TRUE(soon([] {
+    EXPECT_TRUE(becomes_true([] {
         const wccp_engine_lock lock;
         return wccp_if_find_interface("wan0")->complaints.spent != 0;
     }));
@@ -208,7 +209,7 @@ TEST_F(Threads, NotificationsAndADatagramDuringAnExit) {
             asked++;
             wccp_process_if_state_change(&info);
         });
-        ASSERT_TRUE(soon([&] { return asked == 2; }));
+        ASSERT_TRUE(becomes_true([&] { return asked == 2; }));
         see_you(first, 62, "10.1.0.2", "10.1.0.1"); // an unknown group
         std::this_thread::sleep_for(100ms);
         wccpd_exiting = 1;
@@ -319,7 +320,7 @@ TEST_F(Threads, AddressesChangeAThousandTimesWhileReceiversWait) {
     const uint32_t seen[] = {icus_of(61), icus_of(62)};
     see_you(first, 61, "10.1.0.2", "10.1.0.1");
     see_you(second, 62, "10.2.0.2", "10.2.0.1");
-    EXPECT_TRUE(soon([&] { return icus_of(61) > seen[0] && icus_of(62) > seen[1]; }));
+    EXPECT_TRUE(becomes_true([&] { return icus_of(61) > seen[0] && icus_of(62) > seen[1]; }));
 }
 
 } // namespace

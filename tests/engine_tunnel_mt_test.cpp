@@ -12,7 +12,7 @@ namespace {
 
 const be32 self = to_be32(0x0A000001);
 
-be32 router(uint32_t number) {
+be32 router_address(uint32_t number) {
     return to_be32(0x0A000100 + number);
 }
 
@@ -36,7 +36,7 @@ struct Tunnels : testing::Test {
         tunneld.take_commands();
         std::set<uint16_t> ids;
         for (uint32_t i = 0; i < 32; i++)
-            EXPECT_EQ(wccp_add_tunnel(1, self, router(i)), 0);
+            EXPECT_EQ(wccp_add_tunnel(1, self, router_address(i)), 0);
         for (const seen_command &command : tunneld.take_commands())
             ids.insert(command.tunnel_id);
         EXPECT_EQ(ids.size(), 32u);
@@ -57,40 +57,42 @@ std::optional<tunneld_answer> tunneld_refuses(const seen_command &command) {
 } // namespace
 
 TEST_F(Tunnels, GroupsThatShareARouterShareTheTunnel) {
-    EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 0);
+    EXPECT_EQ(wccp_add_tunnel(51, self, router_address(1)), 0);
     EXPECT_TRUE(log.say("WCCP GRP 51: created GRE tunnel id 1000 10.0.0.1 <=> 10.0.1.1"));
-    EXPECT_EQ(wccp_add_tunnel(52, self, router(1)), 0);
+    EXPECT_EQ(wccp_add_tunnel(52, self, router_address(1)), 0);
     using seen = std::vector<seen_command>;
     EXPECT_EQ(commands(), (seen{{MAILBOX_ADD_TUNNEL, 1000, 0x0A000001, 0x0A000101, WCCP_NO_INDEX, 0, 0}}));
-    EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 0);
-    EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "no such tunnel";
+    EXPECT_EQ(wccp_del_tunnel(51, self, router_address(1), 0), 0);
+    EXPECT_EQ(wccp_del_tunnel(51, self, router_address(2), 0), 0) << "no such tunnel";
     EXPECT_EQ(commands().size(), 0u);
-    EXPECT_EQ(wccp_del_tunnel(52, self, router(1), 0), 0);
+    EXPECT_EQ(wccp_del_tunnel(52, self, router_address(1), 0), 0);
     EXPECT_EQ(commands(), (seen{{MAILBOX_DELETE_TUNNEL, 1000, 0x0A000001, 0x0A000101, 2000, 0, 0}}));
     EXPECT_TRUE(log.say("WCCP GRP 52: deleted GRE tunnel id: 1000 10.0.0.1 <=> 10.0.1.1"));
 
-    wccp_add_tunnel(51, self, router(1));
-    wccp_add_tunnel(52, self, router(1));
-    EXPECT_EQ(wccp_del_tunnel(0, self, router(1), 1), 0) << "by force, in spite of the other reference";
+    wccp_add_tunnel(51, self, router_address(1));
+    wccp_add_tunnel(52, self, router_address(1));
+    EXPECT_EQ(wccp_del_tunnel(0, self, router_address(1), 1), 0)
+        << "by force, in spite of the other reference";
     EXPECT_TRUE(log.say("WCCP : deleted GRE tunnel id: 1000"));
     EXPECT_EQ(commands().size(), 2u);
-    EXPECT_EQ(wccp_del_tunnel(52, self, router(1), 0), 0);
+    EXPECT_EQ(wccp_del_tunnel(52, self, router_address(1), 0), 0);
     EXPECT_EQ(commands().size(), 0u);
 }
 
 TEST_F(Tunnels, ThereAreThirtyTwoIdsAndAFreedOneIsUsedNext) {
     for (uint32_t i = 0; i < 32; i++) {
-        ASSERT_EQ(wccp_add_tunnel(1, self, router(i)), 0);
+        ASSERT_EQ(wccp_add_tunnel(1, self, router_address(i)), 0);
         log.take();
     }
     EXPECT_EQ(commands().back().tunnel_id, g_qv_encap_wccp_last);
-    EXPECT_EQ(wccp_add_tunnel(1, self, router(32)), 1);
+    EXPECT_EQ(wccp_add_tunnel(1, self, router_address(32)), 1);
     EXPECT_TRUE(log.say("WCCP GRP 1: No free tunnel id available"));
     EXPECT_EQ(take_reasons(&group), "tunnel-ids-exhausted 10.0.1.32: |ids 1000 to 1031");
-    EXPECT_TRUE(wccp_add_tunnel(1, self, router(4)) == 0 && commands().empty()) << "a known one needs no id";
+    EXPECT_TRUE(wccp_add_tunnel(1, self, router_address(4)) == 0 && commands().empty())
+        << "a known one needs no id";
     for (const uint32_t i : {31u, 7u}) {
-        EXPECT_EQ(wccp_del_tunnel(1, self, router(i), 0), 0);
-        EXPECT_EQ(wccp_add_tunnel(1, self, router(32 + i)), 0);
+        EXPECT_EQ(wccp_del_tunnel(1, self, router_address(i), 0), 0);
+        EXPECT_EQ(wccp_add_tunnel(1, self, router_address(32 + i)), 0);
         EXPECT_EQ(commands().back().tunnel_id, g_qv_encap_wccp_first + i);
     }
 }
@@ -100,25 +102,26 @@ TEST_F(Tunnels, ARefusedAddLeavesNothing) {
                                   return tunneld_answer{0, WCCP_NO_INDEX};
                               }}) {
         tunneld.answer_with(answer);
-        EXPECT_EQ(wccp_add_tunnel(51, self, router(1)), 1);
+        EXPECT_EQ(wccp_add_tunnel(51, self, router_address(1)), 1);
         EXPECT_TRUE(log.say("WCCP GRP 51: failed to add tunnel: id: 1000 10.0.0.1 <=> 10.0.1.1"));
         EXPECT_EQ(take_reasons(&group), "tunnel-refused 10.0.1.1: tunnel id 1000|from 10.0.0.1");
         EXPECT_EQ(commands().size(), 1u);
-        EXPECT_TRUE(wccp_del_tunnel(51, self, router(1), 0) == 0 && commands().empty()) << "not in the table";
+        EXPECT_TRUE(wccp_del_tunnel(51, self, router_address(1), 0) == 0 && commands().empty())
+            << "not in the table";
     }
     tunneld.answer_with(tunneld_does);
-    EXPECT_EQ(wccp_add_tunnel(51, self, router(2)), 0);
+    EXPECT_EQ(wccp_add_tunnel(51, self, router_address(2)), 0);
     EXPECT_EQ(commands()[0].tunnel_id, g_qv_encap_wccp_first);
 }
 
 TEST_F(Tunnels, ARefusedDeleteRemovesTheTunnelNevertheless) {
-    wccp_add_tunnel(51, self, router(1));
-    wccp_add_tunnel(51, self, router(2));
+    wccp_add_tunnel(51, self, router_address(1));
+    wccp_add_tunnel(51, self, router_address(2));
     tunneld.answer_with(tunneld_refuses);
-    EXPECT_EQ(wccp_del_tunnel(51, self, router(1), 0), 1);
+    EXPECT_EQ(wccp_del_tunnel(51, self, router_address(1), 0), 1);
     EXPECT_TRUE(log.say("WCCP GRP 51: failed to delete GRE tunnel id: 1000"));
     wccpd_exiting = 1;
-    EXPECT_EQ(wccp_del_tunnel(51, self, router(2), 0), 0) << "not logged during the exit";
+    EXPECT_EQ(wccp_del_tunnel(51, self, router_address(2), 0), 0) << "not logged during the exit";
     EXPECT_FALSE(log.say("failed to delete"));
     commands();
     wccp_del_all_tunnels();
@@ -127,7 +130,7 @@ TEST_F(Tunnels, ARefusedDeleteRemovesTheTunnelNevertheless) {
 
 TEST_F(Tunnels, RestoreSendsEveryTunnelAgainAndKeepsThemAll) {
     for (uint32_t i = 0; i < 3; i++)
-        wccp_add_tunnel(1, self, router(i));
+        wccp_add_tunnel(1, self, router_address(i));
     commands();
     tunneld.answer_with([](const seen_command &command) {
         return command.tunnel_id == g_qv_encap_wccp_first + 1 ? tunneld_refuses(command)
@@ -182,9 +185,9 @@ TEST_F(Tunnels, DeletingAllWhileOthersAddAndDelete) {
         others.emplace_back([other, &stop, &torn] {
             while (!stop) {
                 for (uint32_t i = 0; i < 8; i++)
-                    torn += wccp_add_tunnel(other, self, router(100 + other * 20 + i)) != 0;
+                    torn += wccp_add_tunnel(other, self, router_address(100 + other * 20 + i)) != 0;
                 for (uint32_t i = 0; i < 8; i++)
-                    torn += wccp_del_tunnel(other, self, router(100 + other * 20 + i), 0) != 0;
+                    torn += wccp_del_tunnel(other, self, router_address(100 + other * 20 + i), 0) != 0;
             }
         });
     for (int i = 0; i < 10; i++)

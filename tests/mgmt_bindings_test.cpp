@@ -70,7 +70,7 @@ const struct type_case {
     {0x1004e, 1, nullptr, nullptr, "soon"},
     {91, 1, nullptr, nullptr, ""},
 };
-strings split(const char *texts) {
+strings split_texts(const char *texts) {
     strings all;
     for (const char *end = texts; texts; texts = *end ? end + 1 : nullptr) {
         end = texts + strcspn(texts, "|");
@@ -118,7 +118,7 @@ void expect_bytes(const bn_attrib *attrib, const std::string &golden) {
 TEST(Values, TextsAndBytes) {
     for (const type_case &c : type_cases) {
         const char *bytes = c.bytes;
-        for (const std::string &row : split(c.texts)) {
+        for (const std::string &row : split_texts(c.texts)) {
             SCOPED_TRACE(std::to_string(c.type) + " " + row);
             const size_t arrow = row.find(" -> ");
             attrib_owner attrib;
@@ -131,7 +131,7 @@ TEST(Values, TextsAndBytes) {
                 expect_bytes(attrib, std::string(header.bytes.begin(), header.bytes.end()) + from_hex(bytes));
             bytes = nullptr; // of the first text only
         }
-        for (const std::string &in : split(c.refused)) {
+        for (const std::string &in : split_texts(c.refused)) {
             SCOPED_TRACE(std::to_string(c.type) + " " + in);
             log_lines log;
             attrib_owner attrib;
@@ -364,7 +364,7 @@ TEST(Bindings, BothMatchersAgreeEverywhere) {
 
 // --- Arrays
 
-void append(bn_binding_array *array, const strings &names) {
+void append_names(bn_binding_array *array, const strings &names) {
     for (const std::string &name : names) {
         binding_owner binding;
         EXPECT_EQ(bn_binding_new_uint32(&binding, name.c_str(), 1, 0, 7), LC_OK);
@@ -376,7 +376,8 @@ TEST(BindingArrays, FindByNameAndPattern) {
     for (const bool sorted : {false, true}) {
         bindings_owner array;
         ASSERT_EQ(bn_binding_array_new(&array), LC_OK);
-        append(array, {"/c/2/router/1", "/c/1", "/c/1/router/3", "/c/1/router/1", "/c-x", "/c/1/router"});
+        append_names(array,
+                     {"/c/2/router/1", "/c/1", "/c/1/router/3", "/c/1/router/1", "/c-x", "/c/1/router"});
         ASSERT_EQ(sorted ? bn_binding_array_sort(array) : LC_OK, LC_OK);
         const bn_binding *found = nullptr;
         string_owner value, name;
@@ -409,7 +410,7 @@ TEST(BindingArrays, RenamedBindingsAreFound) {
     bindings_owner array;
     ASSERT_EQ(bn_binding_array_new(&array), LC_OK);
     for (int i = 40; i > 0; i--)
-        append(array, {"/n/" + std::to_string(i)});
+        append_names(array, {"/n/" + std::to_string(i)});
     const auto expect_index = [&](const char *name, int32_t expected) {
         int32_t index = -2;
         EXPECT_EQ(bn_binding_array_get_index_by_name(array, name, &index), LC_OK);
@@ -420,7 +421,7 @@ TEST(BindingArrays, RenamedBindingsAreFound) {
     ASSERT_EQ(bn_binding_set_name(bn_binding_array_get_quick(array, 35), "/m"), LC_OK);
     expect_index("/n/5", -1);
     expect_index("/m", 35);
-    append(array, {"/a"});
+    append_names(array, {"/a"});
     expect_index("/a", 40);
 }
 

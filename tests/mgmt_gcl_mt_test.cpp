@@ -17,7 +17,7 @@ extern "C" const char *__asan_default_options() {
 
 namespace {
 
-bool stress() {
+bool is_stress_run() {
     const char *value = getenv("WCCP_STRESS");
     return value && *value && *value != '0';
 }
@@ -117,7 +117,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
 
     uint32_t expected[4] = {}, frames = 0, acknowledged = 0, sequence = 2000003;
     std::minstd_rand random(1);
-    const int64_t end = lt_monotonic_ms() + (stress() ? 60000 : 3000);
+    const int64_t end = lt_monotonic_ms() + (is_stress_run() ? 60000 : 3000);
     bool draining = false;
     for (;;) {
         if (!draining && lt_monotonic_ms() > end) {
@@ -163,7 +163,7 @@ TEST(GclThreads, ThreeSendersAndAProviderOfUnevenPace) {
 TEST(GclThreads, AProviderThatClosesWhileOthersSend) {
     gcl_provider provider;
     ASSERT_TRUE(provider.listen_as("mgmtd"));
-    const int rounds = stress() ? 1000 : 60;
+    const int rounds = is_stress_run() ? 1000 : 60;
     std::minstd_rand random(3);
     for (int i = 0; i < rounds; i++) {
         session_thread session;

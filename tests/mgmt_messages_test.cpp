@@ -21,33 +21,34 @@ struct part {
     part(const wire &raw) : bytes(raw) {}
 };
 template <typename... Parts>
-wire pack(const Parts &...parts) {
+wire pack_parts(const Parts &...parts) {
     return (part(parts).bytes + ...);
 }
 constexpr uint8_t relative = 0, absolute = 1;
 // Kind, id, type and flags, and the value with its length.
 wire text_attribute(uint32_t id, uint32_t type, const wire &text) {
-    return pack(4, id, type, 0, static_cast<uint32_t>(text.size()), text);
+    return pack_parts(4, id, type, 0, static_cast<uint32_t>(text.size()), text);
 }
 const wire room(32, '\0');
-wire request(uint16_t type, const wire &rest) {
-    return pack(uint16_t{2}, type, static_cast<uint32_t>(48 + rest.size()), 7, 8, rest);
+wire request_frame(uint16_t type, const wire &rest) {
+    return pack_parts(uint16_t{2}, type, static_cast<uint32_t>(48 + rest.size()), 7, 8, rest);
 }
-wire response(uint16_t type, const wire &rest) {
-    return pack(uint16_t{2}, type, static_cast<uint32_t>(52 + rest.size()), 7, 8, 41, rest);
+wire response_frame(uint16_t type, const wire &rest) {
+    return pack_parts(uint16_t{2}, type, static_cast<uint32_t>(52 + rest.size()), 7, 8, 41, rest);
 }
 
 template <typename Message>
-lc_status read(lc_status (*from)(const tbuffer *, uint32_t, Message **), const wire &bytes, Message **out) {
+lc_status parse_with(lc_status (*from)(const tbuffer *, uint32_t, Message **), const wire &bytes,
+                     Message **out) {
     buffer_owner buffer;
     EXPECT_EQ(tb_new_buf(&buffer, bytes.data(), static_cast<int32_t>(bytes.size())), 0);
     return from(buffer, 32, out);
 }
 lc_status read_request(const wire &bytes, bn_request_msg **out) {
-    return read(bn_request_msg_deserialize, room + bytes, out);
+    return parse_with(bn_request_msg_deserialize, room + bytes, out);
 }
 lc_status read_response(const wire &bytes, bn_response_msg **out) {
-    return read(bn_response_msg_deserialize, room + bytes, out);
+    return parse_with(bn_response_msg_deserialize, room + bytes, out);
 }
 
 // The message is written as these bytes, also after reading them; anything shorter is refused.
@@ -73,10 +74,10 @@ void expect_bytes(Message *msg, const wire &golden, lc_status (*to)(Message *, u
     }
 }
 void expect_request(bn_request_msg *msg, uint16_t type, const wire &rest) {
-    expect_bytes<request_owner>(msg, request(type, rest), bn_request_msg_serialize, read_request);
+    expect_bytes<request_owner>(msg, request_frame(type, rest), bn_request_msg_serialize, read_request);
 }
 void expect_response(bn_response_msg *msg, uint16_t type, const wire &rest) {
-    expect_bytes<response_owner>(msg, response(type, rest), bn_response_msg_serialize, read_response);
+    expect_bytes<response_owner>(msg, response_frame(type, rest), bn_response_msg_serialize, read_response);
 }
 
 TEST(messages, request_bytes) {
@@ -86,9 +87,9 @@ TEST(messages, request_bytes) {
     ASSERT_EQ(bn_query_request_msg_append_str(query, bn_query_get, 0, "/a/b", &id), 0);
     ASSERT_EQ(bn_query_request_msg_append_str(query, bn_query_iterate, 0x3000, "/x\\/y", &next), 0);
     EXPECT_TRUE(id == 1000 && next == 1001);
-    expect_request(
-        query, 1,
-        pack("", 2, 1000, absolute, 2, "a", "b", 0, 1, 0, 1001, absolute, 1, "x/y", 0, 2, 0x3000, 0, "", 0));
+    expect_request(query, 1,
+                   pack_parts("", 2, 1000, absolute, 2, "a", "b", 0, 1, 0, 1001, absolute, 1, "x/y", 0, 2,
+                              0x3000, 0, "", 0));
 
     binding_owner binding;
     ASSERT_EQ(bn_set_request_msg_create(&set, 5), 0);
@@ -97,17 +98,17 @@ TEST(messages, request_bytes) {
     ASSERT_EQ(bn_set_request_msg_append_binding_takeover(set, bn_set_reparent, 9, &binding.pointer, &id), 0);
     EXPECT_EQ(binding.pointer, nullptr);
     expect_request(set, 3,
-                   pack("", 1, 1000, absolute, 1, "n", 2, text_attribute(1, bn_type_str, "v"),
-                        text_attribute(129, bn_type_str, "r"), 5, 9, "", "", 5, "", 0));
+                   pack_parts("", 1, 1000, absolute, 1, "n", 2, text_attribute(1, bn_type_str, "v"),
+                              text_attribute(129, bn_type_str, "r"), 5, 9, "", "", 5, "", 0));
 
     ASSERT_EQ(bn_action_request_msg_create(&action, "/do"), 0);
     ASSERT_EQ(bn_action_request_msg_append_new_binding(action, 0, "event_name", bn_type_name, "/e", &id), 0);
     expect_request(
         action, 5,
-        pack("", 1, 1000, relative, 1, "event_name", 1, text_attribute(1, bn_type_name, "/e"), "/do"));
+        pack_parts("", 1, 1000, relative, 1, "event_name", 1, text_attribute(1, bn_type_name, "/e"), "/do"));
 
     ASSERT_EQ(bn_event_request_msg_create(&event, "/happened"), 0);
-    expect_request(event, 7, pack("", 0, "/happened"));
+    expect_request(event, 7, pack_parts("", 0, "/happened"));
     string_owner name;
     EXPECT_EQ(bn_action_request_msg_get_action_name(event, &name), LC_ASSERTION);
     ASSERT_EQ(bn_event_request_msg_get_event_name(event, &name), 0);
@@ -121,14 +122,14 @@ TEST(messages, attributes_asked_for) {
     uint32_t id = 0;
     ASSERT_EQ(bn_binding_new_uint32(&mask, "/m", bn_attrib_capability_mask, 0, 6), 0);
     const std::pair<uint32_t, wire> cases[] = {
-        {bn_query_get, pack(bn_type_none, 0, 0)},
-        {bn_query_registration_info, pack(bn_type_uint32, 0, 4, 6)},
+        {bn_query_get, pack_parts(bn_type_none, 0, 0)},
+        {bn_query_registration_info, pack_parts(bn_type_uint32, 0, 4, 6)},
     };
     for (const auto &[subop, sent] : cases) {
         request_owner msg;
         ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), 0);
         ASSERT_EQ(bn_query_request_msg_append_with_attribs(msg, subop, 0, "/a", mask->attributes, &id), 0);
-        expect_request(msg, 1, pack("", 1, 1000, absolute, 1, "a", 1, 1, 69, sent, subop, 0, 0, "", 0));
+        expect_request(msg, 1, pack_parts("", 1, 1000, absolute, 1, "a", 1, 1, 69, sent, subop, 0, 0, "", 0));
     }
 }
 
@@ -141,14 +142,16 @@ TEST(messages, response_bytes_and_reading) {
     ASSERT_EQ(bn_binding_new_str(&binding, "/n", bn_attrib_value, bn_type_str, 0, "v"), 0);
     ASSERT_EQ(bn_binding_name_to_parts("/n", &binding.pointer->parts, nullptr), 0);
     ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg, &binding.pointer, 1004), 0);
-    const wire bytes = pack(3, "no", 1, 1004, absolute, 1, "n", 1, text_attribute(1, bn_type_str, "v"), 99);
+    const wire bytes =
+        pack_parts(3, "no", 1, 1004, absolute, 1, "n", 1, text_attribute(1, bn_type_str, "v"), 99);
     expect_response(msg, 2, bytes);
     ASSERT_EQ(bn_response_msg_dup(msg, &copy), 0);
     for (const bool received : {false, true})
         for (const int keep : {0, 1}) {
             response_owner from;
-            ASSERT_EQ((received ? read_response(response(2, bytes), &from) : bn_response_msg_dup(msg, &from)),
-                      0);
+            ASSERT_EQ(
+                (received ? read_response(response_frame(2, bytes), &from) : bn_response_msg_dup(msg, &from)),
+                0);
             for (const uint32_t round : {0u, 1u, 2u}) { // by copy, by takeover, and from what is left
                 uint32_t code = 0;
                 string_owner message;
@@ -174,7 +177,7 @@ TEST(messages, response_bytes_and_reading) {
         response_owner other;
         uint32_t revision = 0;
         ASSERT_EQ(bn_response_msg_create(&other, type, 41, 0, nullptr), 0);
-        expect_response(other, type, pack(0, "", 0, type == 4 ? pack(0) : wire()));
+        expect_response(other, type, pack_parts(0, "", 0, type == 4 ? pack_parts(0) : wire()));
         EXPECT_EQ(bn_query_response_msg_append_binding_takeover(other, &binding.pointer, 0), LC_ASSERTION);
         EXPECT_EQ(bn_query_response_msg_get_db_revision_id(other, &revision), LC_ASSERTION);
     }
@@ -182,12 +185,12 @@ TEST(messages, response_bytes_and_reading) {
 
 // Lengths without the bytes, and malformed values.
 TEST(messages, false_fields_are_refused) {
-    const wire start = request(7, pack("")), node = pack(start, 1, 1000, absolute),
-               named = pack(node, 1, "n");
-    for (const wire &body :
-         {start, node, named, request(7, ""), pack(named, 1, 4), pack(named, 1, 4, 1, bn_type_str, 0)}) {
+    const wire start = request_frame(7, pack_parts("")), node = pack_parts(start, 1, 1000, absolute),
+               named = pack_parts(node, 1, "n");
+    for (const wire &body : {start, node, named, request_frame(7, ""), pack_parts(named, 1, 4),
+                             pack_parts(named, 1, 4, 1, bn_type_str, 0)}) {
         request_owner msg;
-        EXPECT_NE(read_request(pack(body, UINT32_MAX, bn_type_str, 0, "v", wire(8, '\0')), &msg), 0);
+        EXPECT_NE(read_request(pack_parts(body, UINT32_MAX, bn_type_str, 0, "v", wire(8, '\0')), &msg), 0);
         EXPECT_EQ(msg.pointer, nullptr);
     }
 }
@@ -196,17 +199,18 @@ TEST(messages, false_fields_are_refused) {
 TEST(messages, a_nul_in_a_text_is_refused) {
     gcl_log log;
     for (const wire &bytes : {wire("a?b"), wire("a\0b", 3)}) {
-        const wire text = pack(3, bytes), start = pack("", 1, 1000, absolute), value = pack(start, 1, "n", 1),
-                   moved = pack(start, 0, 0, bn_set_reparent, 0), options = pack(0, "", 0);
+        const wire text = pack_parts(3, bytes), start = pack_parts("", 1, 1000, absolute),
+                   value = pack_parts(start, 1, "n", 1), moved = pack_parts(start, 0, 0, bn_set_reparent, 0),
+                   options = pack_parts(0, "", 0);
         const lc_status expected = bytes[1] ? LC_OK : LC_ASSERTION;
         for (const wire &each : {
-                 request(7, pack(text, 0, "e")),
-                 request(7, pack("", 0, text)),
-                 request(7, pack(start, 2, text, "c", 0, "e")),
-                 request(7, pack(value, text_attribute(1, bn_type_str, bytes), "e")),
-                 request(7, pack(value, text_attribute(1, bn_type_uri, bytes), "e")),
-                 request(3, pack(moved, text, "", options)),
-                 request(3, pack(moved, "", text, options)),
+                 request_frame(7, pack_parts(text, 0, "e")),
+                 request_frame(7, pack_parts("", 0, text)),
+                 request_frame(7, pack_parts(start, 2, text, "c", 0, "e")),
+                 request_frame(7, pack_parts(value, text_attribute(1, bn_type_str, bytes), "e")),
+                 request_frame(7, pack_parts(value, text_attribute(1, bn_type_uri, bytes), "e")),
+                 request_frame(3, pack_parts(moved, text, "", options)),
+                 request_frame(3, pack_parts(moved, "", text, options)),
              }) {
             request_owner msg;
             EXPECT_EQ(read_request(each, &msg), expected) << testing::PrintToString(each);
@@ -214,24 +218,24 @@ TEST(messages, a_nul_in_a_text_is_refused) {
         request_owner binary;
         response_owner answer;
         const wire bare = text_attribute(1, bn_type_binary, bytes);
-        ASSERT_EQ(read_request(request(7, pack(value, bare, "e")), &binary), 0);
+        ASSERT_EQ(read_request(request_frame(7, pack_parts(value, bare, "e")), &binary), 0);
         const bn_request_node *node = bn_request_per_node_array_get_quick(binary->nodes, 0);
         EXPECT_EQ(bytes_of(bn_attrib_array_get_quick(node->binding->attributes, 1)->value.binary), bytes);
-        EXPECT_EQ(read_response(response(6, pack(0, text, 0)), &answer), expected);
+        EXPECT_EQ(read_response(response_frame(6, pack_parts(0, text, 0)), &answer), expected);
         EXPECT_EQ(log.count("Received string of 3 bytes contains a NUL at offset 1"), bytes[1] ? 0 : 8);
     }
 }
 
 // ---- Memory
 
-size_t allocated() {
+size_t allocated_bytes() {
     const struct mallinfo2 info = mallinfo2();
     return info.uordblks + info.hblkhd;
 }
 // A received message, and each copy of its bindings, takes at most eight times its bytes, whatever it
 // contains; the parts of the names, if they are wanted, at most nine.
 TEST(messages, received_messages_are_bounded) {
-    const wire name = pack(absolute, 1, "n"), none = pack(1, 130, bn_type_none, 0, 0);
+    const wire name = pack_parts(absolute, 1, "n"), none = pack_parts(1, 130, bn_type_none, 0, 0);
     const auto times = [](size_t count, const wire &piece) {
         wire all;
         while (count--)
@@ -243,23 +247,24 @@ TEST(messages, received_messages_are_bounded) {
         uint32_t nodes;
         wire node; // from its name on
     } shapes[] = {
-        {"nothing", 4000, pack(relative, 0, 0)},
-        {"name of one character", 4000, pack(name, 0)},
-        {"a part of one slash", 4000, pack(relative, 1, "/", 0)},
-        {"three empty parts", 4000, pack(relative, 3, "", "", "", 0)},
-        {"last attribute, no value", 2000, pack(relative, 0, 1, none)},
-        {"empty text", 2000, pack(name, 1, text_attribute(1, bn_type_str, ""))},
-        {"empty bytes", 2000, pack(name, 1, text_attribute(1, bn_type_binary, ""))},
-        {"one attribute again and again", 1, pack(name, 2000, times(2000, none))},
-        {"empty parts", 1, pack(absolute, 20000, times(20000, pack("")), 0)},
-        {"slashes", 1, pack(absolute, 1, 50000, wire(50000, '/'), 0)},
+        {"nothing", 4000, pack_parts(relative, 0, 0)},
+        {"name of one character", 4000, pack_parts(name, 0)},
+        {"a part of one slash", 4000, pack_parts(relative, 1, "/", 0)},
+        {"three empty parts", 4000, pack_parts(relative, 3, "", "", "", 0)},
+        {"last attribute, no value", 2000, pack_parts(relative, 0, 1, none)},
+        {"empty text", 2000, pack_parts(name, 1, text_attribute(1, bn_type_str, ""))},
+        {"empty bytes", 2000, pack_parts(name, 1, text_attribute(1, bn_type_binary, ""))},
+        {"one attribute again and again", 1, pack_parts(name, 2000, times(2000, none))},
+        {"empty parts", 1, pack_parts(absolute, 20000, times(20000, pack_parts("")), 0)},
+        {"slashes", 1, pack_parts(absolute, 1, 50000, wire(50000, '/'), 0)},
         {"an ordinary node", 500,
-         pack(absolute, 4, "qv", "wccpd", "config", "51", 1, text_attribute(1, bn_type_str, "value"))},
+         pack_parts(absolute, 4, "qv", "wccpd", "config", "51", 1, text_attribute(1, bn_type_str, "value"))},
     };
     for (const auto &shape : shapes)
         for (const bool answer : {false, true}) {
-            const wire nodes = pack(shape.nodes, times(shape.nodes, pack(1000, shape.node)));
-            const wire bytes = answer ? response(2, pack(0, "", nodes, 0)) : request(7, pack("", nodes, "e"));
+            const wire nodes = pack_parts(shape.nodes, times(shape.nodes, pack_parts(1000, shape.node)));
+            const wire bytes = answer ? response_frame(2, pack_parts(0, "", nodes, 0))
+                                      : request_frame(7, pack_parts("", nodes, "e"));
             SCOPED_TRACE(shape.what);
             buffer_owner buffer;
             request_owner asked;
@@ -279,9 +284,10 @@ TEST(messages, received_messages_are_bounded) {
                  }}};
             const size_t overhead = 2048, limits[2][3] = {{8, 8, 17}, {8, 8, 10}};
             for (size_t i = 0; i < 3; i++) {
-                const size_t before = allocated();
+                const size_t before = allocated_bytes();
                 ASSERT_EQ(steps[answer][i](), 0);
-                EXPECT_LE(allocated() - before, limits[answer][i] * bytes.size() + overhead) << answer << i;
+                EXPECT_LE(allocated_bytes() - before, limits[answer][i] * bytes.size() + overhead)
+                    << answer << i;
             }
             free(info);
         }
@@ -289,12 +295,13 @@ TEST(messages, received_messages_are_bounded) {
 
 // A received binding can outlive its message, be changed and copied, and give away its name and attributes.
 TEST(messages, received_bindings_can_be_kept) {
-    const wire node = pack(1000, absolute, 1, "n", 3, text_attribute(1, bn_type_str, "v"),
-                           text_attribute(65, bn_type_binary, "b"), 1, 129, bn_type_uint32, 0, 4, 7);
-    const wire bare = pack(1000, absolute, 0, 0);
+    const wire node = pack_parts(1000, absolute, 1, "n", 3, text_attribute(1, bn_type_str, "v"),
+                                 text_attribute(65, bn_type_binary, "b"), 1, 129, bn_type_uint32, 0, 4, 7);
+    const wire bare = pack_parts(1000, absolute, 0, 0);
     response_owner msg;
     bindings_owner bindings;
-    ASSERT_EQ(read_response(response(2, pack(0, "", 5, node, node, node, bare, bare, 0)), &msg), 0);
+    ASSERT_EQ(read_response(response_frame(2, pack_parts(0, "", 5, node, node, node, bare, bare, 0)), &msg),
+              0);
     ASSERT_EQ(bn_response_get_takeover(msg, nullptr, nullptr, 0, &bindings, nullptr), 0);
     const auto value_of = [](const bn_binding *binding) {
         return text_of([&](char **out) { return bn_binding_get_str(binding, 1, 0, nullptr, out); });
@@ -328,20 +335,21 @@ TEST(messages, received_bindings_can_be_kept) {
     request_owner forwarded;
     ASSERT_EQ(bn_event_request_msg_create(&forwarded, "/e"), 0);
     ASSERT_EQ(bn_event_request_msg_append_binding_takeover(forwarded, 0, &kept.pointer, nullptr), 0);
-    expect_request(forwarded, 7, pack("", 1, node, "/e"));
+    expect_request(forwarded, 7, pack_parts("", 1, node, "/e"));
 }
 
 TEST(messages, odd_messages_are_read) {
     request_owner twice, unknown; // an attribute given twice: the later one counts
     const wire both = text_attribute(1, bn_type_str, "v") + text_attribute(1, bn_type_str, "w");
-    ASSERT_EQ(read_request(request(7, pack("", 1, 1000, absolute, 1, "n", 2, both, "e")), &twice), 0);
+    ASSERT_EQ(read_request(request_frame(7, pack_parts("", 1, 1000, absolute, 1, "n", 2, both, "e")), &twice),
+              0);
     string_owner value;
     const bn_request_node *node = bn_request_per_node_array_get_quick(twice->nodes, 0);
     ASSERT_EQ(bn_binding_get_tstr(node->binding, 1, 0, nullptr, &value), 0);
     EXPECT_STREQ(ts_str(value), "w");
 
     gcl_log log;
-    ASSERT_EQ(read_request(request(9, pack("", 0)), &unknown), 0);
+    ASSERT_EQ(read_request(request_frame(9, pack_parts("", 0)), &unknown), 0);
     EXPECT_EQ(log.count("illegal messsage of type 9"), 1);
     EXPECT_EQ(bn_request_get(unknown, nullptr, nullptr, 0, nullptr, nullptr, nullptr), LC_UNEXPECTED_CASE);
     EXPECT_EQ(bn_request_msg_response_msg_type(2), 0);
@@ -367,8 +375,8 @@ struct MessageSession : testing::Test {
     }
     static wire message(uint16_t type) {
         if (type % 2 == 0 && type >= 2 && type <= 8)
-            return response(type, pack(0, "message", 0, type < 6 ? pack(1) : wire()));
-        return request(type, pack("", 0, type < 5 ? pack(0, "", 0) : pack("/name")));
+            return response_frame(type, pack_parts(0, "message", 0, type < 6 ? pack_parts(1) : wire()));
+        return request_frame(type, pack_parts("", 0, type < 5 ? pack_parts(0, "", 0) : pack_parts("/name")));
     }
     bool receive(uint16_t type, const wire &body) { return with.deliver(frame_bytes(2, type, body)); }
 };
@@ -412,15 +420,15 @@ TEST_F(MessageSession, WhatIsNotHandledIsLogged) {
     // The message's own type decides.
     expect_line(7, message(9), "proto bnode: invalid body message type 9");
     expect_line(9, message(7), "proto bnode: invalid body message type 9");
-    expect_line(2, response(10, pack(0, "", 0)), "proto bnode: invalid body message type 10");
-    expect_line(2, response(7, pack(0, "message", 0)),
+    expect_line(2, response_frame(10, pack_parts(0, "", 0)), "proto bnode: invalid body message type 10");
+    expect_line(2, response_frame(7, pack_parts(0, "message", 0)),
                 "proto bnode: no event response callback: code = 0 msg = message");
     expect_line(2, wire("\x00\x03", 2) + message(2).substr(2), "service 3 not open: 2");
     bn_set_session_callback_query_request_msg(with.session, note, this);
     for (const uint16_t frame_type : std::initializer_list<uint16_t>{1, 3})
         EXPECT_TRUE(receive(frame_type, message(1)));
     EXPECT_EQ(calls, "1 1 ");
-    EXPECT_FALSE(receive(7, request(7, pack("", 0, 9, wire("cut")))));
+    EXPECT_FALSE(receive(7, request_frame(7, pack_parts("", 0, 9, wire("cut")))));
     EXPECT_GE(log.count("Error code 14011"), 1);
     EXPECT_EQ(log.count("session 1: closing after error condition"), 1);
     EXPECT_EQ(log.count("messsage"), 0);
@@ -465,7 +473,7 @@ TEST_F(MessageSession, AResponseThatDoesNotFitIsReplaced) {
         EXPECT_EQ(bn_response_msg_send(with.session, response), 0);
     };
     const auto expect_refusal = [&](const wire &frame, const char *words) {
-        EXPECT_EQ(frame.substr(frame.size() < 48 ? 0 : 48), pack(41, LC_NO_BUFFER_SPACE, words, 0, 0));
+        EXPECT_EQ(frame.substr(frame.size() < 48 ? 0 : 48), pack_parts(41, LC_NO_BUFFER_SPACE, words, 0, 0));
     };
     answer(GCL_FRAME_MAX);
     expect_refusal(with.provider.take_frame(), "The answer is larger than a message: ask for less");

@@ -14,7 +14,7 @@
 namespace {
 const std::string ROOT = "/qv/wccpd/wccp/srv_grp/config/51";
 
-strings split(const std::string &text) {
+strings split_line(const std::string &text) {
     std::istringstream in(text);
     return {std::istream_iterator<std::string>(in), {}};
 }
@@ -30,10 +30,14 @@ struct fake {
     uint32_t code = 0;                                                      // of the answer, 1: none comes
     int session_after = 0; // which query tunneld answers, 0: none
 
-    group_result group(const std::string &words) { return group_command(link(), split(words)); }
-    traffic_result intercept(const std::string &words) { return intercept_command(link(), split(words)); }
-    traffic_result bypass(const std::string &words) { return bypass_command(link(), split(words), 1000); }
-    traffic_result tunnel(const std::string &words) { return tunnel_command(link(), split(words)); }
+    group_result group(const std::string &words) { return group_command(link(), split_line(words)); }
+    traffic_result intercept(const std::string &words) {
+        return intercept_command(link(), split_line(words));
+    }
+    traffic_result bypass(const std::string &words) {
+        return bypass_command(link(), split_line(words), 1000);
+    }
+    traffic_result tunnel(const std::string &words) { return tunnel_command(link(), split_line(words)); }
     ctl_link link() {
         commits.clear();
         ctl_link link;

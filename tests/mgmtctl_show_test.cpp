@@ -26,7 +26,7 @@ using json = nlohmann::json;
 const std::string CONFIG = "/qv/wccpd/wccp/srv_grp/config/", STATE = "/qv/wccpd/wccp/srv_grp/state/";
 const std::string ALARM = "/qv/alarms/state/raised/196638/eth0:grp:51";
 
-snapshot gather(canned_nodes *from, const snapshot_limits &limits = {}) {
+snapshot gather_canned(canned_nodes *from, const snapshot_limits &limits = {}) {
     from->asked = 0;
     return gather_snapshot(std::ref(*from), limits);
 }
@@ -98,7 +98,7 @@ canned_nodes many_groups() {
                                           {"/num_routers", "31"},
                                           {"/app_id", "10.0.2.1"}})
             from.add(root + node, value);
-        for (int n = 1; n <= 64 && i < 23; n++) {
+        for (int n = 1; n <= 64 && i < 6; n++) {
             from.add(root + "/appliance/" + std::to_string(n) + "/ipaddr", "10.0.2." + std::to_string(n));
             from.add(root + "/appliance/" + std::to_string(n) + "/weight", "1");
             const std::string router = root + "/router/" + std::to_string(n);
@@ -131,7 +131,7 @@ std::string lines_of(const snapshot &shown) {
 
 TEST(Show, TellsTheWholeOfAGroup) {
     canned_nodes from = one_group();
-    const snapshot shown = gather(&from);
+    const snapshot shown = gather_canned(&from);
     const json all = json::parse(draw_json(shown)), group = all["groups"][0];
     ASSERT_EQ(group["routers"].size(), 3u);
     const json router = group["routers"][0], self = group["appliances"][0], table = group["tables"][0];
@@ -171,7 +171,7 @@ TEST(Show, NothingOfATextReachesTheTerminalAsAControl) {
         if (node.name.find("/state") != std::string::npos && !node.name.ends_with("/oper"))
             node.value += "\033[2J\x9b"
                           "1m\r\n";
-    const snapshot shown = gather(&from);
+    const snapshot shown = gather_canned(&from);
     for (const std::string &text : {screen_of(shown), lines_of(shown), draw_json(shown)})
         for (const char c : text)
             ASSERT_TRUE(c == '\n' || (c >= 0x20 && c < 0x7f)) << static_cast<int>(c) << " in " << text;
@@ -180,13 +180,13 @@ TEST(Show, NothingOfATextReachesTheTerminalAsAControl) {
 TEST(Show, IsEmptyAndSaysSoWhereverMgmtdGoes) {
     canned_nodes from = one_group();
     from.wccpd_code = LC_IO_TIMED_OUT;
-    EXPECT_EQ(gather(&from).wccpd, wccpd_condition::silent);
+    EXPECT_EQ(gather_canned(&from).wccpd, wccpd_condition::silent);
     EXPECT_EQ(from.asked, 11u) << "it is not asked again";
     from.wccpd_code = 0;
-    (void)gather(&from);
+    (void)gather_canned(&from);
     for (size_t all = from.asked, n = 0; n < all; n++) {
         from.lost_after = n;
-        const snapshot shown = gather(&from);
+        const snapshot shown = gather_canned(&from);
         EXPECT_TRUE(shown.groups.empty() && !shown.unreachable.empty());
     }
 }
@@ -194,14 +194,14 @@ TEST(Show, IsEmptyAndSaysSoWhereverMgmtdGoes) {
 TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
     canned_nodes from = many_groups();
     snapshot_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
-    std::vector<std::string> lines = draw_screen(gather(&from, limits), {79, 23, true, true, ""});
+    std::vector<std::string> lines = draw_screen(gather_canned(&from, limits), {79, 23, true, true, ""});
     EXPECT_LE(from.asked, 16u + 23u * 7);
     ASSERT_EQ(lines.size(), 23u);
     EXPECT_TRUE(contains(lines[1], "routers 31/31  share 3%"));
     EXPECT_TRUE(contains(lines.back(), "and 235 groups not shown"));
 
     limits = {.queries = 300};
-    const snapshot detailed = gather(&from, limits);
+    const snapshot detailed = gather_canned(&from, limits);
     EXPECT_LE(from.asked, 300u + 70u);
     const json all = json::parse(draw_json(detailed));
     EXPECT_EQ(all["groups_total"], 256);
@@ -219,16 +219,16 @@ TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
 // --- Reasons
 
 // What a command prints; it has to exit with this status.
-std::string printed(const std::function<int()> &command, int exit) {
+std::string output_of(const std::function<int()> &command, int exit) {
     testing::internal::CaptureStdout();
     EXPECT_EQ(command(), exit);
     fflush(stdout);
     return testing::internal::GetCapturedStdout();
 }
-std::string explained(const snapshot &shown, int group, int exit, bool as_json = false) {
+std::string explanation_of(const snapshot &shown, int group, int exit, bool as_json = false) {
     ctl_options options;
     options.json = as_json;
-    return printed([&] { return tell_reasons(options, shown, group); }, exit);
+    return output_of([&] { return tell_reasons(options, shown, group); }, exit);
 }
 
 // Each row breaks a group that works, or changes it; wccpd's reasons are CODE SOURCE SENDER OFFERED/WANTED.
@@ -285,12 +285,12 @@ TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
             from.add(root, row.value);
         }
         from.add(NODE_PLANE_STATE "/name", "table");
-        const snapshot shown = gather(&from);
-        EXPECT_TRUE(contains(explained(shown, 51, row.exit), row.said));
+        const snapshot shown = gather_canned(&from);
+        EXPECT_TRUE(contains(explanation_of(shown, 51, row.exit), row.said));
         EXPECT_TRUE(contains(screen_of(shown), row.screen));
         EXPECT_EQ(json::parse(draw_json(shown))["groups"][0]["tables"][0]["routers"].size(),
                   strstr(row.value, "by the router") ? 1u : 2u); // such a table is misread
-        const json parsed = json::parse(explained(shown, -1, row.exit, true));
+        const json parsed = json::parse(explanation_of(shown, -1, row.exit, true));
         for (const json &each : parsed["reasons"])
             EXPECT_TRUE(each["cause"] != "" && each["next"] != "") << each;
     }
@@ -313,20 +313,20 @@ TEST(Show, WhatIsNotKnownIsNotSaid) {
     std::erase_if(from.nodes, [](const ctl_binding &node) { return node.name.starts_with(ALARM); });
     for (const uint32_t code : {uint32_t{LC_IO_CLOSED}, uint32_t{LC_IO_TIMED_OUT}}) {
         from.wccpd_code = code;
-        const snapshot shown = gather(&from);
+        const snapshot shown = gather_canned(&from);
         EXPECT_TRUE(lacks(screen_of(shown), "no alarm"));
         const json all = json::parse(draw_json(shown));
         EXPECT_TRUE(all["alarms_total"].is_null() && all["groups"][0]["state"].is_null());
         EXPECT_EQ(all["reasons"][0]["reason"], code == LC_IO_CLOSED ? "wccpd-absent" : "wccpd-silent");
-        (void)explained(shown, -1, 1);
+        (void)explanation_of(shown, -1, 1);
     }
     from.lost_after = 0;
-    EXPECT_EQ(json::parse(explained(gather(&from), -1, 2, true))["reasons"][0]["reason"],
+    EXPECT_EQ(json::parse(explanation_of(gather_canned(&from), -1, 2, true))["reasons"][0]["reason"],
               "mgmtd-unreachable");
     from.lost_after = SIZE_MAX;
     snapshot_limits other;
     other.only = 52;
-    (void)explained(gather(&from, other), 52, 2, true);
+    (void)explanation_of(gather_canned(&from, other), 52, 2, true);
 }
 
 TEST(Show, EveryReasonHasWordsAndIsInTheDocuments) {
@@ -373,10 +373,10 @@ const char *const TRAFFIC =
 
 TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
     canned_nodes from = one_group();
-    EXPECT_TRUE(contains(screen_of(gather(&from)), "\n\ntunneld: no session\n"));
-    EXPECT_EQ(json::parse(draw_json(gather(&from)))["traffic"]["clamped"], nullptr);
+    EXPECT_TRUE(contains(screen_of(gather_canned(&from)), "\n\ntunneld: no session\n"));
+    EXPECT_EQ(json::parse(draw_json(gather_canned(&from)))["traffic"]["clamped"], nullptr);
     add_traffic(&from, TRAFFIC);
-    const snapshot shown = gather(&from);
+    const snapshot shown = gather_canned(&from);
     const std::string screen = screen_of(shown);
     EXPECT_TRUE(contains(screen, "51  left its routers", "  router 10.0.0.3        not asked\n",
                          "\ntraffic  data plane user  1 tunnel\n"
@@ -407,7 +407,7 @@ TEST(Show, RedirectedTrafficIsPartOfItWithReasons) {
     from.add(NODE_ACCEPT_CONFIG "/10.0.0.9", "10.0.0.9");
     for (ctl_binding &node : from.nodes)
         node.value = node.name.ends_with("/clamped") ? "1" : node.value;
-    const std::string lines = lines_of(gather(&from));
+    const std::string lines = lines_of(gather_canned(&from));
     EXPECT_TRUE(contains(lines, "note  group 51: the proxy is down: refused?[2J\n"));
     EXPECT_TRUE(lacks(lines, "fragments", "refused source"));
 }
@@ -417,9 +417,11 @@ TEST(Show, CommandsForTrafficPrintWhatTheyFind) {
     ctl_link link;
     link.query = std::ref(from);
     ctl_options options;
-    const auto tunnels = [&](int exit) { return printed([&] { return tell_tunnels(options, link); }, exit); };
+    const auto tunnels = [&](int exit) {
+        return output_of([&] { return tell_tunnels(options, link); }, exit);
+    };
     const auto intercepts = [&](const char *group, int exit) {
-        return printed([&] { return tell_intercepts(options, link, group); }, exit);
+        return output_of([&] { return tell_intercepts(options, link, group); }, exit);
     };
     EXPECT_EQ(tunnels(CTL_UNREACHABLE), "tunneld has no session\n");
     add_traffic(&from, TRAFFIC);

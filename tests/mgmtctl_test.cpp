@@ -232,7 +232,7 @@ TEST(Changes, AWholeConfigurationIsItsDifference) {
 
 // --- Names
 
-static canned_nodes sample() {
+static canned_nodes sample_nodes() {
     return {{{G51, "uint8", "51"},
              {G51 + "/weight", "uint32", "100"},
              {GROUPS + "/7", "uint8", "7"},
@@ -246,7 +246,7 @@ static canned_nodes sample() {
 }
 
 TEST(Names, AreCompletedToTheirNextPart) {
-    canned_nodes known = sample();
+    canned_nodes known = sample_nodes();
     const auto check = [&](const std::string &word, const std::string &found) {
         EXPECT_EQ(joined(complete_node_name(std::ref(known), word), " "), found);
     };
@@ -260,7 +260,7 @@ TEST(Names, AreCompletedToTheirNextPart) {
 }
 
 TEST(Names, AMistypedOneGetsAHint) {
-    canned_nodes known = sample();
+    canned_nodes known = sample_nodes();
     const ctl_ask ask = std::ref(known);
     const auto check = [&](const std::string &name, const std::string &hint) {
         EXPECT_EQ(hint_for_missing(ask, name), hint);
@@ -278,7 +278,7 @@ TEST(Names, AMistypedOneGetsAHint) {
 }
 
 TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
-    canned_nodes known = sample();
+    canned_nodes known = sample_nodes();
     std::vector<ctl_binding> many = {{STATES + "/51/num_appliances", "uint32", "4000000000"},
                                      {STATES + "/51/oper", "string", "x"}};
     ASSERT_TRUE(add_appliances(std::ref(known), STATES, &many));
@@ -290,7 +290,7 @@ TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
 }
 
 TEST(Walks, WhatIsLargerThanAMessageComesInPieces) {
-    canned_nodes known = sample();
+    canned_nodes known = sample_nodes();
     const auto names = [&](const std::string &root, uint32_t code) {
         node_name parsed;
         ctl_reply reply;
@@ -392,7 +392,7 @@ static check_facts sound_host() {
 }
 
 // The codes of what was found, then what was not checked.
-static std::string judged(const check_facts &host) {
+static std::string judge_host(const check_facts &host) {
     std::string text;
     const check_result result = judge_facts(host);
     for (const reason &each : result.findings) {
@@ -450,7 +450,7 @@ TEST(Check, EachFactIsJudged) {
         row.change(&host);
         if (!host.mgmtd_error.empty())
             host.sockets.clear();
-        EXPECT_EQ(judged(host), row.found) << &row - rows;
+        EXPECT_EQ(judge_host(host), row.found) << &row - rows;
     }
     const std::string documents = text_of_file(WCCP_SOURCE_DIR "/docs/operations.md");
     for (const reason_text &text : check_texts())
@@ -458,7 +458,7 @@ TEST(Check, EachFactIsJudged) {
 }
 
 // A table "f" with a chain at a hook, of these rules.
-static std::string listing(const std::string &head, const strings &rules) {
+static std::string nft_listing(const std::string &head, const strings &rules) {
     const std::string above = R"("family":"inet","table":"f",)";
     std::string text = R"({"nftables":[{"set":{)" + above + R"("name":"ports","elem":[53,2048]}},)" +
                        R"({"chain":{)" + above + R"("name":"refuse"}},{"chain":{)" + above +
@@ -484,8 +484,8 @@ TEST(Check, RulesThatDropTheProtocolAreFound) {
                       unclear = "firewall-unclear@51 ";
     const auto check = [](const std::string &head, const strings &rules, const std::string &found) {
         check_facts host = sound_host();
-        host.filter_listing = listing(head, rules);
-        EXPECT_EQ(judged(host), found) << host.filter_listing;
+        host.filter_listing = nft_listing(head, rules);
+        EXPECT_EQ(judge_host(host), found) << host.filter_listing;
     };
     check(input, {}, "");
     check(closed, {replies + accept}, no_wccp + no_gre);

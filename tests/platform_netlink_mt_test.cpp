@@ -82,13 +82,13 @@ void on_address(const void *argument) {
     seen->take(static_cast<const char *>(argument), true, "");
 }
 
-void hold(bool on) {
+void set_held(bool on) {
     std::unique_lock lock(seen->mutex);
     seen->held = on;
     seen->changed.notify_all();
 }
 
-void shell(const std::string &command) {
+void run_shell(const std::string &command) {
     const std::string functions =
         "add() { ip link add $1 type veth peer name $2; }; up() { ip link set $1 up; };"
         "down() { ip link set $1 down; }; name() { ip link set $1 name $2; };"
@@ -102,12 +102,12 @@ void wait_until(bool (*condition)()) {
 }
 // A callback waits until hold(false).
 void hold_callback() {
-    hold(true);
-    shell("down lo && up lo");
+    set_held(true);
+    run_shell("down lo && up lo");
     wait_until([] { return seen->waiting; });
 }
 
-void start(void (*between_the_kinds)() = [] {}) {
+void start_notifications(void (*between_the_kinds)() = [] {}) {
     if (seen)
         return;
     seen = new known_state;
@@ -124,19 +124,19 @@ void start(void (*between_the_kinds)() = [] {}) {
 
 // Leaves a change of a link in the queue, which the start of the other kind empties, while a callback waits.
 void change_early() {
-    shell("add early other && up other && up early");
+    run_shell("add early other && up other && up early");
     wait_until([] { return seen->links["early"] == "1/1"; });
     hold_callback();
-    shell("down early");
+    run_shell("down early");
 }
 
-int flip(const char *name, bool up) {
+int flip_link(const char *name, bool up) {
     ifreq request = request_for(name);
     request.ifr_flags = up ? IFF_UP : 0;
     return ioctl(g_qvif_skfd, SIOCSIFFLAGS, &request);
 }
 
-void batch(const std::string &commands) {
+void run_ip_batch(const std::string &commands) {
     FILE *ip = popen("ip -force -batch - >/dev/null 2>&1", "w");
     ASSERT_TRUE(ip);
     fputs(commands.c_str(), ip);
@@ -181,23 +181,23 @@ std::vector<std::string> take_reported() {
     std::unique_lock lock(seen->mutex);
     return std::exchange(seen->reported, {});
 }
-bool contains(const std::vector<std::string> &reported, const char *text) {
+bool was_reported(const std::vector<std::string> &reported, const char *text) {
     return std::find(reported.begin(), reported.end(), text) != reported.end();
 }
 
 struct Netlink : testing::Test {
     void SetUp() override {
-        start(change_early);
-        hold(false);
-        shell("va");
+        start_notifications(change_early);
+        set_held(false);
+        run_shell("va");
         ASSERT_TRUE(state_is_the_kernels());
         ASSERT_EQ(seen->addresses["va"], "10.9.0.1");
     }
     void TearDown() override {
-        hold(false);
+        set_held(false);
         for (const std::string &name : kernel_names())
             if (name != "lo")
-                batch("link del " + name + "\n");
+                run_ip_batch("link del " + name + "\n");
         EXPECT_TRUE(state_is_the_kernels());
     }
 };
@@ -266,8 +266,8 @@ TEST_F(Netlink, TheThreadIsSmallAndTakesNoSignal) {
     EXPECT_LE(seen->stack, 128u * 1024);
 #endif
     // One thread, which blocks all but SIGKILL, SIGSTOP and the C library's own two.
-    shell("name=$(grep -lx qv_netlink /proc/" + std::to_string(getpid()) +
-          "/task/*/comm) && grep -qE 'SigBlk:.fffffff[ef][7f]ffbfeff' \"${name%/comm}/status\"");
+    run_shell("name=$(grep -lx qv_netlink /proc/" + std::to_string(getpid()) +
+              "/task/*/comm) && grep -qE 'SigBlk:.fffffff[ef][7f]ffbfeff' \"${name%/comm}/status\"");
 }
 
 // Also when a callback is blocked while the kernel's queue overruns many times; the notifications that matter
@@ -281,16 +281,16 @@ TEST_F(Netlink, EachChangeIsReported) {
             if (overrun)
                 hold_callback();
             for (int i = 0; overrun && i < 3000; i++)
-                ASSERT_EQ(flip("va", i % 2), 0);
+                ASSERT_EQ(flip_link("va", i % 2), 0);
             (void)take_reported();
-            shell(commands);
-            hold(false);
+            run_shell(commands);
+            set_held(false);
             ASSERT_TRUE(state_is_the_kernels());
             const std::vector<std::string> reported = take_reported();
             EXPECT_FALSE(overrun && reported.size() >= 2000) << "the queue did not overrun";
             const bool lost = overrun && strcmp(commands, REMAKE) != 0;
-            EXPECT_TRUE(lost || !expected || contains(reported, expected));
-            EXPECT_FALSE(never_expected && contains(reported, never_expected));
+            EXPECT_TRUE(lost || !expected || was_reported(reported, expected));
+            EXPECT_FALSE(never_expected && was_reported(reported, never_expected));
             TearDown();
             SetUp();
         }
@@ -315,9 +315,9 @@ TEST_F(Netlink, AnyOrderOfEverythingEndsInTheRightState) {
             commands += all[random() % 8] + "\n";
         }
         if (round % 3 == 0)
-            hold(true);
-        batch(commands);
-        hold(false);
+            set_held(true);
+        run_ip_batch(commands);
+        set_held(false);
         ASSERT_TRUE(state_is_the_kernels()) << "round " << round;
     }
 }
@@ -330,10 +330,10 @@ ssize_t draw_out(void *, const char *, size_t count) {
 }
 
 TEST(Exit, DISABLED_Child) {
-    start();
+    start_notifications();
     std::thread([] {
         for (bool up = true;; up = !up)
-            if (flip("lo", up) != 0)
+            if (flip_link("lo", up) != 0)
                 _exit(3); // the test would not test anything
     }).detach();
     std::this_thread::sleep_for(50ms);

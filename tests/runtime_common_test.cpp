@@ -12,7 +12,7 @@
 
 namespace {
 
-lc_status inner(char check, lc_status status) {
+lc_status check_inner(char check, lc_status status) {
     if (check == 'q')
         CHECK_QUIET(status);
     if (check == 'n')
@@ -24,8 +24,8 @@ lc_status inner(char check, lc_status status) {
     CHECK_STATUS(status);
     return LC_OK;
 }
-lc_status outer(lc_status status) {
-    CHECK_STATUS(inner('s', status));
+lc_status check_outer(lc_status status) {
+    CHECK_STATUS(check_inner('s', status));
     return LC_OK;
 }
 
@@ -40,22 +40,22 @@ struct Checks : testing::Test {
 };
 
 TEST_F(Checks, EachFailureHasItsLineAtEachLevel) {
-    EXPECT_EQ(outer(LC_NOT_FOUND), LC_NOT_FOUND);
-    EXPECT_EQ(logged(), "inner: Error code 14004 (item not found) returned\n"
-                        "outer: Error code 14004 (item not found) returned\n");
+    EXPECT_EQ(check_outer(LC_NOT_FOUND), LC_NOT_FOUND);
+    EXPECT_EQ(logged(), "check_inner: Error code 14004 (item not found) returned\n"
+                        "check_outer: Error code 14004 (item not found) returned\n");
     const std::tuple<char, lc_status, lc_status, std::string> cases[] = {
-        {'s', 14024, 14024, "inner: Error code 14024 returned\n"},
+        {'s', 14024, 14024, "check_inner: Error code 14024 returned\n"},
         {'s', LC_CANCELLED, LC_CANCELLED, ""},
         {'q', LC_NOT_FOUND, LC_NOT_FOUND, ""},
-        {'n', 1, LC_NULL, "inner: Unexpected NULL\n"},
-        {'c', 1, LC_ASSERTION, "inner: Required condition was not met\n"},
+        {'n', 1, LC_NULL, "check_inner: Unexpected NULL\n"},
+        {'c', 1, LC_ASSERTION, "check_inner: Required condition was not met\n"},
         {'f', LC_IO_CLOSED, LC_IO_CLOSED,
-         "inner: Bail forced with error code 14016 (IO source/sink is closed)\n"},
-        {'f', 3, 3, "inner: Bail forced with error code 3\n"},
+         "check_inner: Bail forced with error code 14016 (IO source/sink is closed)\n"},
+        {'f', 3, 3, "check_inner: Bail forced with error code 3\n"},
         {'s', LC_OK, LC_OK, ""},
     };
     for (const auto &[check, status, result, lines] : cases) {
-        EXPECT_EQ(inner(check, status), result);
+        EXPECT_EQ(check_inner(check, status), result);
         EXPECT_EQ(logged(), lines) << status;
     }
 }

@@ -11,7 +11,7 @@
 
 namespace {
 
-void *word(uintptr_t value) {
+void *as_pointer(uintptr_t value) {
     return reinterpret_cast<void *>(value);
 }
 
@@ -36,7 +36,7 @@ struct FdicList : testing::Test {
                                  &id);
     }
     lc_status add_timer(int64_t delay) {
-        return fdic_event_add_timer(list, delay, word(0x10), nullptr, nullptr, &id);
+        return fdic_event_add_timer(list, delay, as_pointer(0x10), nullptr, nullptr, &id);
     }
     void expect(const char *changes, lc_status got, lc_status status = LC_OK) {
         EXPECT_EQ(got, status) << changes;
@@ -97,8 +97,8 @@ struct FdicBridge : testing::Test {
         ASSERT_TRUE(lew_init(&wrapper) == LC_OK && lew_get_event_context(wrapper, &loop) == LC_OK);
         ASSERT_EQ(fdic_libevent_init(loop, &bridge), LC_OK);
         ASSERT_EQ(fdic_init(&list, fdic_libevent_callback, bridge), LC_OK);
-        ASSERT_EQ(fdic_libevent_set_fd_close_handler(bridge, called, word(55)), LC_OK);
-        ASSERT_EQ(fdic_libevent_set_fd_open_handler(bridge, called, word(44)), LC_OK);
+        ASSERT_EQ(fdic_libevent_set_fd_close_handler(bridge, called, as_pointer(55)), LC_OK);
+        ASSERT_EQ(fdic_libevent_set_fd_open_handler(bridge, called, as_pointer(44)), LC_OK);
         ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, ends), 0);
     }
     void TearDown() override {
@@ -110,8 +110,8 @@ struct FdicBridge : testing::Test {
     }
     int32_t add(int want_read, int want_write) {
         int32_t id = 0;
-        EXPECT_EQ(fdic_event_add_fd(list, ends[0], want_read, want_write, this, called, word(1), called,
-                                    word(2), &id),
+        EXPECT_EQ(fdic_event_add_fd(list, ends[0], want_read, want_write, this, called, as_pointer(1), called,
+                                    as_pointer(2), &id),
                   LC_OK);
         return id;
     }
@@ -157,14 +157,14 @@ TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
 TEST_F(FdicBridge, TimersFireOnce) {
     int32_t id = 0, soon = 0;
     int none = 0;
-    ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, word(3), &id), LC_OK);
+    ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, as_pointer(3), &id), LC_OK);
     expect_round("3:3 ");
     EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay does not start it again
     EXPECT_EQ(lew_dispatch_once(wrapper, &none, nullptr), LC_OK);
     EXPECT_EQ(none, 1);
     // The largest delay does not overflow.
     EXPECT_EQ(fdic_event_update_timer(list, id, INT64_MAX), LC_OK);
-    ASSERT_EQ(fdic_event_add_timer(list, 1, this, called, word(9), &soon), LC_OK);
+    ASSERT_EQ(fdic_event_add_timer(list, 1, this, called, as_pointer(9), &soon), LC_OK);
     expect_round("3:9 ");
     EXPECT_EQ(fdic_event_delete_timer(list, id), LC_OK);
 }

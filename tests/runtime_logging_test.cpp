@@ -29,11 +29,11 @@ std::string read_file(const char *path) {
 }
 
 // The text after the syslog head and the thread mark.
-std::string body(const std::string &line) {
+std::string body_of(const std::string &line) {
     const size_t mark = line.find("TID ");
     return mark == std::string::npos ? line : line.substr(line.find(": ", mark) + 2);
 }
-testing::AssertionResult matches(const std::string &text, const char *pattern) {
+testing::AssertionResult matches_regex(const std::string &text, const char *pattern) {
     return testing::AssertionResult(std::regex_match(text, std::regex(pattern))) << text;
 }
 
@@ -62,8 +62,8 @@ struct Log : testing::Test {
 TEST_F(Log, TheFirstLineSetsUpTheLog) {
     ASSERT_EQ(G_log_state_lock, nullptr);
     LC_LOG(LC_LOG_NOTICE, "early");
-    EXPECT_TRUE(matches(daemon.one(), "<13>.*runtime_logging_test-UNINIT\\[\\d+\\]: TID \\d+: "
-                                      "\\[unk\\.NOTICE\\]: unk: early\n"));
+    EXPECT_TRUE(matches_regex(daemon.one(), "<13>.*runtime_logging_test-UNINIT\\[\\d+\\]: TID \\d+: "
+                                            "\\[unk\\.NOTICE\\]: unk: early\n"));
 }
 
 TEST_F(Log, ALineHasTheBytesOfVsyslog) {
@@ -83,23 +83,23 @@ TEST_F(Log, ALineHasTheBytesOfVsyslog) {
     }
     EXPECT_EQ(lc_log_init("wccpd", nullptr, LC_LOG_FLAG_NO_PID, 0x1060000, 7, 24, 1), LC_OK);
     QV_LOG(LC_LOG_ERR, "x");
-    EXPECT_TRUE(matches(daemon.one(), "<27>[A-Z][a-z]{2} [ 1-3][0-9] [0-9:]{8} wccpd: TID \\d+: .*\n"));
+    EXPECT_TRUE(matches_regex(daemon.one(), "<27>[A-Z][a-z]{2} [ 1-3][0-9] [0-9:]{8} wccpd: TID \\d+: .*\n"));
     closelog();
 }
 
 TEST_F(Log, TheBodyOfALine) {
     ASSERT_EQ(init(), LC_OK);
     QV_LOG(LC_LOG_NOTICE, "100%% of %s", "%s");
-    EXPECT_EQ(body(daemon.one()), "[wccpd.NOTICE]: 100% of %s\n");
+    EXPECT_EQ(body_of(daemon.one()), "[wccpd.NOTICE]: 100% of %s\n");
     util_log(LC_LOG_ERR, "pre: ", "%d%%", 5);
-    EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: pre: 5%\n");
+    EXPECT_EQ(body_of(daemon.one()), "[wccpd.ERR]: pre: 5%\n");
     errno = ENOENT;
     (void)lc_log_internal(nullptr, nullptr, 0, 0, 0x3f00000, LC_LOG_ERR, "%m");
     EXPECT_EQ(errno, ENOENT);
-    EXPECT_EQ(body(daemon.one()), "[UNKNOWN_COMP.ERR]: No such file or directory\n");
+    EXPECT_EQ(body_of(daemon.one()), "[UNKNOWN_COMP.ERR]: No such file or directory\n");
     ASSERT_EQ(init("wccpd", LC_LOG_FLAG_STAMP_USEC | LC_LOG_FLAG_RELATIVE, "prefix"), LC_OK);
     LC_LOG(LC_LOG_ERR, "text");
-    EXPECT_TRUE(matches(body(daemon.one()), "\\[0\\.0\\d{5}\\] \\[wccpd\\.ERR\\]: prefix: text\n"));
+    EXPECT_TRUE(matches_regex(body_of(daemon.one()), "\\[0\\.0\\d{5}\\] \\[wccpd\\.ERR\\]: prefix: text\n"));
     LC_LOG(LC_LOG_ERR, "x");
     EXPECT_NE(daemon.one().find(": TID " + std::to_string(gettid()) + ": ["), std::string::npos);
 }
@@ -107,7 +107,7 @@ TEST_F(Log, TheBodyOfALine) {
 TEST_F(Log, WhatDoesNotFitIsCut) {
     ASSERT_EQ(init(), LC_OK);
     QV_LOG(LC_LOG_ERR, "%s", std::string(2000, 'y').c_str());
-    EXPECT_EQ(body(daemon.one()), "[wccpd.ERR]: " + std::string(1023, 'y') + "\n");
+    EXPECT_EQ(body_of(daemon.one()), "[wccpd.ERR]: " + std::string(1023, 'y') + "\n");
     // Cuts the format at each position around its conversion.
     for (int length = 960; length < 1020; length++) {
         const std::string format =
@@ -147,7 +147,7 @@ TEST_F(Log, LevelsAndTheirOrder) {
     QV_LOG(LC_LOG_NOTICE, "dropped");
     EXPECT_EQ(lc_log_set_daemon_log_level(5), LC_OK);
     QV_LOG(LC_LOG_NOTICE, "kept");
-    EXPECT_EQ(body(daemon.one()), "[wccpd.NOTICE]: kept\n");
+    EXPECT_EQ(body_of(daemon.one()), "[wccpd.NOTICE]: kept\n");
 }
 
 TEST_F(Log, TheOverrideAppliesWhileBothSwitchesAreOn) {
@@ -207,9 +207,9 @@ TEST_F(Log, AConsoleGetsAHeaderAndKeepsItsLevel) {
     EXPECT_EQ(lc_log_set_max_log_level("emerg"), LC_OK);
     testing::internal::CaptureStderr();
     LC_LOG(LC_LOG_ERR, "seen %d", 1);
-    EXPECT_TRUE(matches(testing::internal::GetCapturedStderr(),
-                        "[A-Z][a-z]{2} [ 1-3][0-9] [0-9:]{8} [^ .]+ tool\\[\\d+\\]: TID \\d+: "
-                        "\\[wccpd\\.ERR\\]: seen 1\n"));
+    EXPECT_TRUE(matches_regex(testing::internal::GetCapturedStderr(),
+                              "[A-Z][a-z]{2} [ 1-3][0-9] [0-9:]{8} [^ .]+ tool\\[\\d+\\]: TID \\d+: "
+                              "\\[wccpd\\.ERR\\]: seen 1\n"));
     EXPECT_EQ(daemon.take().size(), 0u);
 }
 
@@ -228,13 +228,13 @@ TEST(Files, TheFacilityAndTheDebugLog) {
     write_file(FACILITY, "# system 8\nflow 144\nsystem\n\nsystem 160\nsystem 176\n");
     EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 160);
     EXPECT_EQ(lc_log_get_facility(nullptr, "mgmtctl"), 136);
-    EXPECT_TRUE(matches(read_file(DEBUG), "\\d{6} \\d{6} Skipping facility type: flow for wccpd\n"));
+    EXPECT_TRUE(matches_regex(read_file(DEBUG), "\\d{6} \\d{6} Skipping facility type: flow for wccpd\n"));
     unlink(FACILITY);
     write_file(DEBUG, std::string(1999999, 'x') + "\n");
     EXPECT_EQ(lc_log_file(nullptr, "%d", 1), 0);
     EXPECT_GT(std::filesystem::file_size(DEBUG), 2000000u);
     EXPECT_EQ(lc_log_file(nullptr, "%d", 2), 0); // too large to append to
-    EXPECT_TRUE(matches(read_file(DEBUG), "\\d{6} \\d{6} 2\n"));
+    EXPECT_TRUE(matches_regex(read_file(DEBUG), "\\d{6} \\d{6} 2\n"));
     EXPECT_EQ(lc_log_file("/no/such/directory", "x"), 1);
     unlink(DEBUG);
 }

@@ -76,7 +76,7 @@ shmid_ds segment_of(key_t key) {
     EXPECT_EQ(shmctl(shmget(key, 0, 0), IPC_STAT, &status), 0);
     return status;
 }
-uint8_t *create(uint64_t length, const char *name) {
+uint8_t *create_block(uint64_t length, const char *name) {
     return static_cast<uint8_t *>(cmem_create_block(length, name));
 }
 
@@ -107,7 +107,7 @@ struct Blocks : testing::Test {
 TEST_F(Blocks, ANewBlockIsFoundByOthersAndInTheRegistry) {
     IN_CHILD({
         EXPECT_EQ(cmem_exists_block("block"), 0);
-        uint8_t *block = create(BLOCK_BYTES, "block");
+        uint8_t *block = create_block(BLOCK_BYTES, "block");
         ASSERT_NE(block, nullptr);
         EXPECT_EQ(segment_of(BLOCK_KEY).shm_segsz, 12288u);
         EXPECT_EQ(segment_of(BLOCK_KEY).shm_perm.mode & 0777, 0777);
@@ -116,7 +116,7 @@ TEST_F(Blocks, ANewBlockIsFoundByOthersAndInTheRegistry) {
         uint64_t length = 0;
         const auto *again = static_cast<uint8_t *>(cmem_attach_block("block", &length));
         EXPECT_TRUE(again && length == 12288 && again[12287] == 5);
-        EXPECT_EQ(create(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_EQ(create_block(BLOCK_BYTES, "block"), nullptr);
         const std::string pid = std::to_string(getpid());
         EXPECT_TRUE(logged("cmem_create_block: double create attempt for memory block block, old pid=" + pid +
                            ", new pid=" + pid + "\n"));
@@ -138,11 +138,11 @@ TEST_F(Blocks, ANewBlockIsFoundByOthersAndInTheRegistry) {
 
 TEST_F(Blocks, TheNextProcessTakesOverABlock) {
     IN_CHILD({
-        EXPECT_EQ(in_process(false, [] { memset(create(BLOCK_BYTES, "block"), 0xff, 12288); }), 0);
-        EXPECT_EQ(create(BLOCK_BYTES * 2, "block"), nullptr);
+        EXPECT_EQ(in_process(false, [] { memset(create_block(BLOCK_BYTES, "block"), 0xff, 12288); }), 0);
+        EXPECT_EQ(create_block(BLOCK_BYTES * 2, "block"), nullptr);
         EXPECT_TRUE(logged("length change attempt for memory block block, old len=12288, new len=20480\n"));
         const int id = shmget(BLOCK_KEY, 0, 0);
-        const uint8_t *block = create(BLOCK_BYTES + 1, "block");
+        const uint8_t *block = create_block(BLOCK_BYTES + 1, "block");
         ASSERT_NE(block, nullptr);
         EXPECT_EQ(shmget(BLOCK_KEY, 0, 0), id);
         EXPECT_EQ(std::count(block, block + 12288, 0), 12288);
@@ -150,14 +150,14 @@ TEST_F(Blocks, TheNextProcessTakesOverABlock) {
     IN_CHILD({ // from a zombie, and from an earlier process with our process id
         const pid_t gone = fork();
         if (gone == 0)
-            _exit(create(BLOCK_BYTES, "block") && create(1, "other") ? 0 : 1);
+            _exit(create_block(BLOCK_BYTES, "block") && create_block(1, "other") ? 0 : 1);
         siginfo_t info;
         ASSERT_EQ(waitid(P_PID, static_cast<id_t>(gone), &info, WEXITED | WNOWAIT), 0);
-        EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_NE(create_block(BLOCK_BYTES, "block"), nullptr);
         const int32_t pid = getpid();
         memcpy(registry_bytes() + 168 + 112, &pid, sizeof pid);
-        EXPECT_NE(create(1, "other"), nullptr);
-        EXPECT_EQ(create(1, "other"), nullptr); // now it is ours
+        EXPECT_NE(create_block(1, "other"), nullptr);
+        EXPECT_EQ(create_block(1, "other"), nullptr); // now it is ours
         (void)waitpid(gone, nullptr, 0);
     });
 }
@@ -181,7 +181,7 @@ TEST_F(Blocks, OfTwoProcessesExactlyOneCreatesABlock) {
             for (int process = 0; process < 2; process++)
                 if (fork() == 0) {
                     meet(&counts[0]);
-                    counts[1] += create(BLOCK_BYTES, "block") != nullptr;
+                    counts[1] += create_block(BLOCK_BYTES, "block") != nullptr;
                     meet(&counts[2]);
                     _exit(0);
                 }
@@ -199,14 +199,14 @@ TEST_F(Blocks, ARegistryThatIsNotReady) {
     constexpr uint32_t EMPTY = 0, LOADING = 0xFFFFFFFF, READY = 1;
     IN_CHILD({ // the process that loads it has died
         registry_state() = LOADING;
-        EXPECT_EQ(create(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_EQ(create_block(BLOCK_BYTES, "block"), nullptr);
         EXPECT_EQ(slept, 5u);
         EXPECT_TRUE(logged("cmem_attach_registry: the block registry has been loading for 5 seconds"));
         EXPECT_EQ(segment_of(CMEM_REGISTRY_KEY).shm_nattch, 1u); // the test's own
         // It finishes in time, or sets the registry back to empty.
         registry_state() = LOADING;
         while_asleep = [] { registry_state() = EMPTY; };
-        EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_NE(create_block(BLOCK_BYTES, "block"), nullptr);
         EXPECT_EQ(registry_state(), READY);
     });
     expect_abort([] { registry_state() = 7; });
@@ -221,22 +221,22 @@ TEST_F(Blocks, ARegistryThatIsNotReady) {
         expect_unreadable("Is a directory");
         std::filesystem::remove(CMEM_CONF_PATH);
         write_conf("block local normal 12345\n");
-        EXPECT_NE(create(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_NE(create_block(BLOCK_BYTES, "block"), nullptr);
     });
 }
 
 TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
     IN_CHILD({
         ASSERT_GE(shmget(BLOCK_KEY, 4096, IPC_CREAT | 0777), 0);
-        EXPECT_EQ(create(BLOCK_BYTES, "block"), nullptr);
+        EXPECT_EQ(create_block(BLOCK_BYTES, "block"), nullptr);
         EXPECT_TRUE(
             logged("cmem_create_block: cannot attach/shmget shared block block, length=12288, key=12345, "
                    "pagesize=4096, shmid=-1, err=Invalid argument, errno=22, check SHMMAX\n"));
         EXPECT_EQ(cmem_exists_block("block"), 0); // its record has been freed
-        EXPECT_EQ(create(UINT64_MAX, "block"), nullptr);
+        EXPECT_EQ(create_block(UINT64_MAX, "block"), nullptr);
         EXPECT_TRUE(logged("cannot attach/shmget shared block block"));
         // The segment of a block in the registry has been replaced by a shorter one.
-        ASSERT_NE(create(BLOCK_BYTES, "other"), nullptr);
+        ASSERT_NE(create_block(BLOCK_BYTES, "other"), nullptr);
         ASSERT_EQ(shmctl(shmget(0x12346, 0, 0), IPC_RMID, nullptr), 0);
         EXPECT_EQ(cmem_exists_block("other"), 0);
         EXPECT_TRUE(logged("cannot shmget to shared block other, err=No such file or directory\n"));
@@ -248,7 +248,7 @@ TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
         IN_CHILD({
             ASSERT_GE(shmget(BLOCK_KEY, bytes, IPC_CREAT | 0777), 0);
             uint64_t length = 0;
-            EXPECT_TRUE(create(BLOCK_BYTES, "block") && cmem_attach_block("block", &length));
+            EXPECT_TRUE(create_block(BLOCK_BYTES, "block") && cmem_attach_block("block", &length));
             EXPECT_EQ(length, 12288u);
         });
     for (const size_t bytes : {size_t{1}, REGISTRY_BYTES - 1}) // a registry that is too short
@@ -265,7 +265,7 @@ TEST_F(Blocks, LinesOfTheConfiguration) {
         conf += "many" + std::to_string(i) + " local normal " + std::to_string(i) + "\n";
     write_conf(conf);
     IN_CHILD({
-        EXPECT_NE(create(1, longest.c_str()), nullptr);
+        EXPECT_NE(create_block(1, longest.c_str()), nullptr);
         EXPECT_GE(shmget(0x2a, 0, 0), 0);
         const std::vector<std::string> lines = daemon.take();
         const std::string wanted[] = {"affinity at line bad 12 normal 1\n", "affinity at line bad\n",
@@ -275,12 +275,12 @@ TEST_F(Blocks, LinesOfTheConfiguration) {
         for (size_t i = 0; i < 4; i++)
             EXPECT_NE(lines[i].find("error parsing " + wanted[i]), std::string::npos) << lines[i];
         for (const std::string name : {"bad", "worse", "registry", "nokey", "big", "words", "unlisted"}) {
-            EXPECT_EQ(create(1, name.c_str()), nullptr);
+            EXPECT_EQ(create_block(1, name.c_str()), nullptr);
             EXPECT_TRUE(logged("attempt to create shared block " + name + " conflicts with conf file\n"));
         }
         EXPECT_EQ(cmem_create_block(1, "at"), reinterpret_cast<void *>(0x300000000000));
-        EXPECT_NE(create(1, "many800"), nullptr);
-        EXPECT_EQ(create(1, "many999"), nullptr); // more than the table has room for
+        EXPECT_NE(create_block(1, "many800"), nullptr);
+        EXPECT_EQ(create_block(1, "many999"), nullptr); // more than the table has room for
     });
 }
 

@@ -7,7 +7,7 @@
 namespace {
 
 // What an operation leaves: the text or the size, or the number of the failure.
-std::string left(lc_status status, const tstring *string) {
+std::string status_and_text(lc_status status, const tstring *string) {
     return status == LC_OK ? text(string) : std::to_string(status);
 }
 template <typename Object>
@@ -24,7 +24,7 @@ TEST(Strings, GrowAndShrink) {
     EXPECT_EQ(size_left(ts_append_char(string, 'x'), string), 32u);
     EXPECT_EQ(size_left(ts_append_str(string, many.c_str() + 916), string), 128u);
     EXPECT_EQ(size_left(ts_clear_no_resize(string), string), 128u);
-    EXPECT_EQ(left(ts_append_str(string, "z"), string), "z");
+    EXPECT_EQ(status_and_text(ts_append_str(string, "z"), string), "z");
     EXPECT_EQ(size_left(ts_clear(string), string), 16u);
     EXPECT_EQ(size_left(ts_append_str(string, many.c_str()), string), 1024u);
     EXPECT_EQ(size_left(ts_copy_str(string, 20, "end"), string), 64u); // stops at four times what is needed
@@ -44,15 +44,15 @@ TEST(Strings, GrowAndShrink) {
 TEST(Strings, OffsetsAndTheirLimits) {
     string_owner string, piece;
     ASSERT_EQ(ts_new_str(&string, "abcdef"), LC_OK);
-    EXPECT_EQ(left(ts_put_str(string, 2, "XY"), string), "abXYef");
-    EXPECT_EQ(left(ts_put_str(string, 5, "12"), string), "abXYe12");
-    EXPECT_EQ(left(ts_put_char(string, 99, 'd'), string), "abXYe12d"); // past the end appends
-    EXPECT_EQ(left(ts_copy_str(string, 1, "cd"), string), "acd");
-    EXPECT_EQ(left(ts_insert_char(string, 1, 'b'), string), "abcd");
-    EXPECT_EQ(left(ts_append(string, string), string), "abcdabcd"); // itself
-    EXPECT_EQ(left(ts_append_str_frag(string, "0123456", 2, 3), string), "abcdabcd234");
-    EXPECT_EQ(left(ts_append_str_frag(string, "0123456", 5, -1), string), "abcdabcd23456");
-    EXPECT_EQ(left(ts_append_sprintf(string, "-%d", 7), string), "abcdabcd23456-7");
+    EXPECT_EQ(status_and_text(ts_put_str(string, 2, "XY"), string), "abXYef");
+    EXPECT_EQ(status_and_text(ts_put_str(string, 5, "12"), string), "abXYe12");
+    EXPECT_EQ(status_and_text(ts_put_char(string, 99, 'd'), string), "abXYe12d"); // past the end appends
+    EXPECT_EQ(status_and_text(ts_copy_str(string, 1, "cd"), string), "acd");
+    EXPECT_EQ(status_and_text(ts_insert_char(string, 1, 'b'), string), "abcd");
+    EXPECT_EQ(status_and_text(ts_append(string, string), string), "abcdabcd"); // itself
+    EXPECT_EQ(status_and_text(ts_append_str_frag(string, "0123456", 2, 3), string), "abcdabcd234");
+    EXPECT_EQ(status_and_text(ts_append_str_frag(string, "0123456", 5, -1), string), "abcdabcd23456");
+    EXPECT_EQ(status_and_text(ts_append_sprintf(string, "-%d", 7), string), "abcdabcd23456-7");
     for (const lc_status status : {ts_insert_char(string, 16, 'x'), ts_put_str(string, 16, "x"),
                                    ts_copy_str(string, -1, "x"), ts_append_str_frag(string, "012", 4, 1)})
         EXPECT_EQ(status, LC_NO_BUFFER_SPACE);
@@ -61,7 +61,7 @@ TEST(Strings, OffsetsAndTheirLimits) {
     int32_t at = 0;
     EXPECT_TRUE(ts_rfind_char(string, 3, 'a', &at) == LC_OK && at == 0);
     ASSERT_EQ(ts_new_str(&piece, "  a b //"), LC_OK);
-    EXPECT_EQ(left(ts_trim(piece, ' ', '/'), piece), "a b ");
+    EXPECT_EQ(status_and_text(ts_trim(piece, ' ', '/'), piece), "a b ");
 }
 
 TEST(Strings, NullsTakeoverAndOrder) {
@@ -98,7 +98,7 @@ TEST(Strings, PackedInOneAllocation) {
         memcpy(bytes, "ab\0cd", 6);
         ts_place(&records[0], bytes, 2);
         ts_place(&records[1], bytes + 3, 2);
-        EXPECT_EQ(left(change(records), records), expected);
+        EXPECT_EQ(status_and_text(change(records), records), expected);
         ASSERT_EQ(tstr_array_append_str(array, "more"), LC_OK); // moves the slots
         EXPECT_STREQ(tstr_array_get_str_quick(array, 1), "cd");
         ASSERT_EQ(tstr_array_remove(array, 0, &one), LC_OK);
@@ -112,7 +112,8 @@ TEST(Strings, CharactersOfUtf8) {
     EXPECT_TRUE(ts_num_chars(string) == 4 && ts_set_utf8(string, 1) == LC_OK && ts_num_chars(string) == 3);
     EXPECT_TRUE(ts_get_char(string, 1) == 0xe4 && ts_equal_str(string, "A\xc3\x84Z", 1));
     EXPECT_TRUE(ts_substr(string, 1, 1, &piece) == LC_OK && text(piece) == "\xc3\xa4");
-    EXPECT_EQ(left(ts_put_str(string, 1, "\xe2\x82\xac"), string), "a\xe2\x82\xacz"); // one for one
+    EXPECT_EQ(status_and_text(ts_put_str(string, 1, "\xe2\x82\xac"), string),
+              "a\xe2\x82\xacz"); // one for one
     int32_t at = 0;
     EXPECT_TRUE(ts_find_char(string, 0, 'z', &at) == LC_OK && at == 2);
     log_lines log;
@@ -123,7 +124,7 @@ TEST(Strings, CharactersOfUtf8) {
 
 // --- Tokens
 
-std::string tokens(const char *given, char separator, char escape, char quote, uint32_t flags) {
+std::string split_tokens(const char *given, char separator, char escape, char quote, uint32_t flags) {
     tokens_owner array;
     if (ts_tokenize_str(given, separator, escape, quote, flags, &array) != LC_OK)
         return "(failed)";
@@ -132,7 +133,8 @@ std::string tokens(const char *given, char separator, char escape, char quote, u
         all += "[" + token + "]";
     return all;
 }
-std::string joined(const std::vector<const char *> &parts, char separator, char escape, uint32_t flags) {
+std::string rejoined_text(const std::vector<const char *> &parts, char separator, char escape,
+                          uint32_t flags) {
     tokens_owner array;
     string_owner string;
     EXPECT_EQ(tstr_array_new(&array, nullptr), LC_OK);
@@ -143,21 +145,22 @@ std::string joined(const std::vector<const char *> &parts, char separator, char 
 
 TEST(Tokens, SplitAndJoin) {
     log_lines log;
-    EXPECT_EQ(tokens("/a//b", '/', 0, 0, 0x8), "[a][b]");
-    EXPECT_EQ(tokens("a\\b/c\\\\d\\/\\", '/', '\\', 0, 0), "[a\\b][c\\d/\\]");
-    EXPECT_EQ(tokens("a 'b c' 'd e", ' ', 0, '\'', 0x1), "[a]['b c']['d e']");
-    EXPECT_EQ(tokens("a/b/", '/', 0, 0, 0x14), "[a][b]");
-    EXPECT_EQ(tokens("/", '/', 0, 0, 0x2c), "(null)");
-    EXPECT_EQ(tokens("a", '/', '\\', '\\', 0), "(failed)");
+    EXPECT_EQ(split_tokens("/a//b", '/', 0, 0, 0x8), "[a][b]");
+    EXPECT_EQ(split_tokens("a\\b/c\\\\d\\/\\", '/', '\\', 0, 0), "[a\\b][c\\d/\\]");
+    EXPECT_EQ(split_tokens("a 'b c' 'd e", ' ', 0, '\'', 0x1), "[a]['b c']['d e']");
+    EXPECT_EQ(split_tokens("a/b/", '/', 0, 0, 0x14), "[a][b]");
+    EXPECT_EQ(split_tokens("/", '/', 0, 0, 0x2c), "(null)");
+    EXPECT_EQ(split_tokens("a", '/', '\\', '\\', 0), "(failed)");
     EXPECT_TRUE(log.say("called with invalid chars: 47 92 92"));
-    EXPECT_EQ(joined({"a", "b"}, '/', 0, 0x100), "/a/b");
-    EXPECT_EQ(joined({"a", "", "b"}, '/', 0, 0x600), "a/b/");
-    EXPECT_EQ(joined({"a\\b", "c\\\\d"}, '/', '\\', 0), "a\\b/c\\\\\\d");
-    EXPECT_EQ(joined({"a"}, 0, 0, 0x100), "(failed)");
+    EXPECT_EQ(rejoined_text({"a", "b"}, '/', 0, 0x100), "/a/b");
+    EXPECT_EQ(rejoined_text({"a", "", "b"}, '/', 0, 0x600), "a/b/");
+    EXPECT_EQ(rejoined_text({"a\\b", "c\\\\d"}, '/', '\\', 0), "a\\b/c\\\\\\d");
+    EXPECT_EQ(rejoined_text({"a"}, 0, 0, 0x100), "(failed)");
     // An escape at the end of a part must not swallow the separator after it.
     for (const char *part : {"a\\", "\\\\", "\\/", "/", "x\\/\\"}) {
-        const std::string name = joined({part, part, "end"}, '/', '\\', 0x100);
-        EXPECT_EQ(tokens(name.c_str(), '/', '\\', 0, 0x2c), std::string("[") + part + "][" + part + "][end]");
+        const std::string name = rejoined_text({part, part, "end"}, '/', '\\', 0x100);
+        EXPECT_EQ(split_tokens(name.c_str(), '/', '\\', 0, 0x2c),
+                  std::string("[") + part + "][" + part + "][end]");
     }
 }
 

@@ -8,8 +8,8 @@
 set -u
 top=$(cd "$(dirname "$0")/.." && pwd)
 export WCCP_BIN=${1:-$top/build/release/bin}
-# With a sanitizer, on a busy machine, wccpd can't serve 200 groups at thirty times the speed.
-if ! grep -q __asan_init "$WCCP_BIN/wccpd"; then : "${LAB_SPEED:=30}"; else : "${LAB_SPEED:=10}"; fi
+# With a sanitizer, on a busy machine, wccpd can't serve 200 groups at twenty times the speed.
+if ! grep -q __asan_init "$WCCP_BIN/wccpd"; then : "${LAB_SPEED:=20}"; else : "${LAB_SPEED:=10}"; fi
 export LAB_SPEED LAB_LOG_LEVEL=notice
 # shellcheck source=../lab/topology.sh
 source "$top/lab/topology.sh"

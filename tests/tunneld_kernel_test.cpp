@@ -73,7 +73,7 @@ std::string describe_rule(const wanted_rule &rule) {
     return text;
 }
 
-std::set<std::string> describe(const wanted_state &wanted) {
+std::set<std::string> describe_wanted(const wanted_state &wanted) {
     std::set<std::string> lines;
     for (const auto &link : wanted.links)
         lines.insert("link " + link.name + " " + link_alias(link.wish));
@@ -116,7 +116,7 @@ struct wanted_case {
 };
 
 // Group 61 shares its flows with OTHER; group 62 redirects the servers' replies.
-void protect(appliance_view *view, bool by_mask) {
+void share_flows(appliance_view *view, bool by_mask) {
     view->groups[62] = view->groups[61];
     for (const uint8_t id : {uint8_t{61}, uint8_t{62}}) {
         view->protections[id] = {by_mask, {1, 0, 0, 0}, {OTHER, R1}, {0, OTHER}};
@@ -184,7 +184,7 @@ const wanted_case wanted_cases[] = {
       "mss 0 outer dropped", "!setting all/rp_filter 0 restored", "!group 61 eth0",
       "!rule 1 eth0 57430002 254", "!member wccp0"},
      [](appliance_view &view) {
-         protect(&view, true);
+         share_flows(&view, true);
          view.groups.erase(62);
          view.tunnels.clear();
          view.intercepts.clear();
@@ -202,19 +202,19 @@ const wanted_case wanted_cases[] = {
       "rule 0 wccp2 57430001 204800", "rule 3 wccp2 0 204803", "ends 10.0.0.101 10.0.0.9",
       "!rule 1 wccp2 57430002 254", "!passing wccp3", "!bucket 9 of 61 to 10.0.0.9"},
      [](appliance_view &view) {
-         protect(&view, true);
+         share_flows(&view, true);
          view.accepted = {{OTHER, 0}};
      }},
     {"another appliance, by bucket: a passing link as well",
      {"link wccp3 tunneld 0 10.0.0.101 10.0.0.9 passing", "passing wccp3", "rule 3 wccp3 0 270339",
       "bucket 9 of 61 to 10.0.0.9", "bucket 9 of 62 to 10.0.0.9 by source", "group 61 wccp0",
       "!ends 10.0.0.101 10.0.0.2 passing", "!member wccp3"},
-     [](appliance_view &view) { protect(&view, false); }},
+     [](appliance_view &view) { share_flows(&view, false); }},
     {"another appliance, by L2",
      {"link wccp0 tunneld 0 10.0.0.101 10.0.0.1 member", "route 204801 eth0 via 10.0.0.17",
       "route 270337 wccp0", "group 61 eth0 - 1"},
      [](appliance_view &view) {
-         protect(&view, true);
+         share_flows(&view, true);
          view.tunnels.clear();
          use_l2(&view);
      }},
@@ -230,7 +230,7 @@ TEST(wanted_state, follows_the_view) {
         SCOPED_TRACE(one.name);
         appliance_view view = two_tunnels();
         one.change(view);
-        const auto lines = describe(make_wanted_state(view, {}, true));
+        const auto lines = describe_wanted(make_wanted_state(view, {}, true));
         for (const auto &line : one.lines)
             EXPECT_TRUE(line[0] == '!' ? !lines.count(line.substr(1)) : lines.count(line)) << line;
     }
@@ -299,11 +299,11 @@ void run_program(const std::function<void()> &steps) {
 std::string setting_file(const std::string &path) {
     return "/proc/sys/net/ipv4/conf/" + path;
 }
-void set(const std::string &path, const std::string &value) {
+void put_setting(const std::string &path, const std::string &value) {
     std::ofstream(setting_file(path)) << value;
 }
 // The values of several settings, each of which is one character.
-std::string get(const strings &paths) {
+std::string read_settings(const strings &paths) {
     std::string values, value;
     for (const auto &path : paths) {
         std::ifstream(setting_file(path)) >> value;
@@ -338,7 +338,7 @@ int count_changes(const std::function<void()> &steps) {
 }
 
 std::map<std::string, uint32_t> indices;
-std::string reconcile(const wanted_state &wanted, const data_plane &plane = tun_plane) {
+std::string reconcile_kernel(const wanted_state &wanted, const data_plane &plane = tun_plane) {
     std::string error;
     const bool done = reconcile_kernel_state(plane, wanted, &indices, &error);
     EXPECT_EQ(done, error.empty());
@@ -365,13 +365,13 @@ std::set<std::string> find_ours() {
 }
 std::set<std::string> links_and_tables(const wanted_state &wanted) {
     std::set<std::string> lines;
-    for (const auto &line : describe(wanted))
+    for (const auto &line : describe_wanted(wanted))
         if (line.starts_with("link ") || line.starts_with("rule ") || line.starts_with("route "))
             lines.insert(line);
     return lines;
 }
 void reconcile_all(const wanted_state &wanted, const data_plane &plane = tun_plane) {
-    EXPECT_EQ(reconcile(wanted, plane), "");
+    EXPECT_EQ(reconcile_kernel(wanted, plane), "");
     EXPECT_EQ(find_ours(), links_and_tables(wanted));
 }
 void remove_all(const data_plane &plane = tun_plane) {
@@ -392,7 +392,7 @@ protected:
                   0);
         for (const char *key : {"rp_filter", "send_redirects"})
             for (const char *interface : {"all", "default", "eth0"})
-                set(std::string(interface) + "/" + key, strcmp(interface, "all") == 0 ? "1" : "0");
+                put_setting(std::string(interface) + "/" + key, strcmp(interface, "all") == 0 ? "1" : "0");
     }
     void TearDown() override {
         run_program([] { remove_all(); });
@@ -405,18 +405,18 @@ protected:
 TEST_F(kernel_state, made_once_followed_and_removed) {
     run_program([] {
         appliance_view view = two_tunnels();
-        protect(&view, false);
+        share_flows(&view, false);
         auto wanted = make_wanted_state(view, {}, true);
         reconcile_all(wanted);
         EXPECT_EQ(indices["wccp1"], if_nametoindex("wccp1"));
         for (const auto &setting : wanted.settings)
-            EXPECT_EQ(get({setting.path}), setting.value) << setting.path;
+            EXPECT_EQ(read_settings({setting.path}), setting.value) << setting.path;
 
         EXPECT_NE(route_of("iif wccp0").find("table 204801"), std::string::npos) << route_of("iif wccp0");
         EXPECT_EQ(route_of("iif wccp0 mark 0x57430001").find("local "), 0u);
         EXPECT_NE(route_of("iif wccp0 mark 0x57430002").find("dev eth0"), std::string::npos);
 
-        EXPECT_EQ(count_changes([&] { EXPECT_EQ(reconcile(wanted), ""); }), 0);
+        EXPECT_EQ(count_changes([&] { EXPECT_EQ(reconcile_kernel(wanted), ""); }), 0);
 
         // A tunnel gets another id and L2 return, the other tunnel is deleted, and flows are no longer passed
         // on.
@@ -447,7 +447,7 @@ TEST_F(kernel_state, made_once_followed_and_removed) {
 TEST_F(kernel_state, what_a_killed_program_leaves_is_taken_over) {
     appliance_view view = two_tunnels();
     view.groups[61].routers[0].forward = travel::l2;
-    run_program([&] { EXPECT_EQ(reconcile(make_wanted_state(view, {}, true)), ""); });
+    run_program([&] { EXPECT_EQ(reconcile_kernel(make_wanted_state(view, {}, true)), ""); });
     // A link whose program has died does not lose packets: they are routed like others once the kernel has
     // noticed.
     std::string route;
@@ -485,32 +485,33 @@ TEST_F(kernel_state, what_a_killed_program_leaves_is_taken_over) {
 
 TEST_F(kernel_state, settings_come_back) {
     const strings filters = {"all/rp_filter", "eth0/rp_filter", "lan1/rp_filter", "default/rp_filter"};
-    set("default/rp_filter", "2");
+    put_setting("default/rp_filter", "2");
     close(open_tun("lan1"));
-    set("lan1/rp_filter", "0");
+    put_setting("lan1/rp_filter", "0");
     appliance_view view = two_tunnels();
     view.groups[61].routers[0].forward = travel::l2;
     const auto wanted = make_wanted_state(view, {}, true);
     run_program([&] {
-        EXPECT_EQ(reconcile(wanted), "");
-        EXPECT_EQ(get(filters), "0112");
-        EXPECT_EQ(get({"eth0/forwarding", "eth0/accept_local", "eth0/send_redirects"}), "110");
-        EXPECT_EQ(get({"lan1/send_redirects"}), "1"); // as `all` had it
+        EXPECT_EQ(reconcile_kernel(wanted), "");
+        EXPECT_EQ(read_settings(filters), "0112");
+        EXPECT_EQ(read_settings({"eth0/forwarding", "eth0/accept_local", "eth0/send_redirects"}), "110");
+        EXPECT_EQ(read_settings({"lan1/send_redirects"}), "1"); // as `all` had it
     });
     // The program was killed, an operator has changed a setting, and the file has invalid lines.
-    set("lan1/rp_filter", "2");
+    put_setting("lan1/rp_filter", "2");
     EXPECT_EQ(
         system("(echo 'eth0/../../x 1 1'; echo 'all/rp_filter 1'; echo 'all/forwarding 1x 0'; head -c 5000 "
                "/dev/zero) >>/run/tunneld/settings"),
         0);
     run_program([&] {
-        EXPECT_EQ(reconcile(wanted), ""); // the values found now are not the ones to restore
+        EXPECT_EQ(reconcile_kernel(wanted), ""); // the values found now are not the ones to restore
         view.groups[61].routers[0].forward = travel::gre;
-        EXPECT_EQ(reconcile(make_wanted_state(view, wanted.links, true)), "");
-        EXPECT_EQ(get({"eth0/forwarding", "eth0/accept_local", "all/rp_filter", "eth0/rp_filter"}), "0001");
+        EXPECT_EQ(reconcile_kernel(make_wanted_state(view, wanted.links, true)), "");
+        EXPECT_EQ(read_settings({"eth0/forwarding", "eth0/accept_local", "all/rp_filter", "eth0/rp_filter"}),
+                  "0001");
         remove_all();
-        EXPECT_EQ(get(filters), "1022");
-        EXPECT_EQ(get({"all/send_redirects", "eth0/send_redirects", "lan1/send_redirects"}), "100");
+        EXPECT_EQ(read_settings(filters), "1022");
+        EXPECT_EQ(read_settings({"all/send_redirects", "eth0/send_redirects", "lan1/send_redirects"}), "100");
         EXPECT_EQ(system("ls /run/tunneld/* 2>/dev/null"), 2 << 8);
     });
     EXPECT_EQ(system("ip link delete lan1"), 0);
@@ -524,15 +525,15 @@ TEST_F(kernel_state, failures_are_reported_and_the_rest_is_done) {
         const auto wanted = make_wanted_state(view, {}, true);
         ASSERT_EQ(mount("/proc/sys", "/proc/sys", nullptr, MS_BIND, nullptr), 0);
         ASSERT_EQ(mount(nullptr, "/proc/sys", nullptr, MS_BIND | MS_REMOUNT | MS_RDONLY, nullptr), 0);
-        EXPECT_EQ(reconcile(wanted),
+        EXPECT_EQ(reconcile_kernel(wanted),
                   "cannot set /proc/sys/net/ipv4/conf/default/rp_filter to 1: Read-only file system");
         EXPECT_EQ(umount("/proc/sys"), 0);
         auto expected = links_and_tables(wanted);
         EXPECT_EQ(expected.erase("route 204801 eth7 via 10.0.0.17"), 1u);
         EXPECT_EQ(find_ours(), expected);
-        EXPECT_EQ(reconcile(wanted),
+        EXPECT_EQ(reconcile_kernel(wanted),
                   "cannot add the default route of table 204801 (eth7 via 10.0.0.17): No such device");
-        EXPECT_EQ(get({"wccp0/accept_local"}), "1");
+        EXPECT_EQ(read_settings({"wccp0/accept_local"}), "1");
     });
 }
 
@@ -551,7 +552,7 @@ TEST(kernel_plane, makes_gre_links_or_says_why_not) {
     EXPECT_EQ(find_ours(), std::set<std::string>()); // the probe leaves nothing
     if (!has_gre) {
         EXPECT_EQ(error, "the kernel cannot make GRE links: Operation not supported");
-        EXPECT_EQ(reconcile(wanted, kernel_plane),
+        EXPECT_EQ(reconcile_kernel(wanted, kernel_plane),
                   "cannot make link wccp0 (GRE 10.0.0.101 to 10.0.0.1): Operation not supported");
         EXPECT_TRUE(indices.empty());
         return;
@@ -564,7 +565,7 @@ TEST(kernel_plane, makes_gre_links_or_says_why_not) {
         reconcile_gre();
         std::swap(wanted.links[0].wish, wanted.links[1].wish);
         wanted.links.pop_back();
-        reconcile(wanted, kernel_plane); // another link still has these ends
+        reconcile_kernel(wanted, kernel_plane); // another link still has these ends
         wanted = make_wanted_state(two_tunnels(), wanted.links, false);
         reconcile_gre();
         plane_counters counters;

@@ -26,17 +26,17 @@
 namespace {
 
 template <typename Header>
-Header *at(bytes *packet, size_t offset) {
+Header *header_at(bytes *packet, size_t offset) {
     return reinterpret_cast<Header *>(packet->data() + offset);
 }
-ip4_wire_header *ip(bytes *packet) {
+ip4_wire_header *ip_header(bytes *packet) {
     return ip_of(packet->data());
 }
-tcp_wire_header *tcp(bytes *packet) {
-    return at<tcp_wire_header>(packet, sizeof(ip4_wire_header));
+tcp_wire_header *tcp_header(bytes *packet) {
+    return header_at<tcp_wire_header>(packet, sizeof(ip4_wire_header));
 }
 
-void mend(bytes *packet) {
+void fix_checksums(bytes *packet) {
     mend_packet(packet->data(), packet->size());
 }
 
@@ -45,9 +45,9 @@ bytes make_packet(uint8_t protocol, uint32_t number, size_t payload) {
     const size_t transport = protocol == PROTOCOL_TCP ? 32 : sizeof(udp_wire_header);
     bytes packet =
         make_ip_packet(protocol, 0xc6336401, 0xcb007101, bytes(transport + payload), IP4_DONT_FRAGMENT);
-    ip(&packet)->id = to_be16(static_cast<uint16_t>(0xfffe + number));
-    ip(&packet)->ttl = 60;
-    tcp_wire_header *header = tcp(&packet);
+    ip_header(&packet)->id = to_be16(static_cast<uint16_t>(0xfffe + number));
+    ip_header(&packet)->ttl = 60;
+    tcp_wire_header *header = tcp_header(&packet);
     header->source_port = to_be16(40000);
     header->destination_port = to_be16(80);
     if (protocol == PROTOCOL_TCP) {
@@ -58,19 +58,20 @@ bytes make_packet(uint8_t protocol, uint32_t number, size_t payload) {
     }
     for (size_t i = packet.size() - payload; i < packet.size(); i++)
         packet[i] = static_cast<uint8_t>(i * 7 + number);
-    mend(&packet);
+    fix_checksums(&packet);
     return packet;
 }
 
-bytes wrap(uint16_t flags, uint16_t type, const bytes &content, const bytes &between = {}) {
+bytes wrap_in_gre(uint16_t flags, uint16_t type, const bytes &content, const bytes &between = {}) {
     bytes out(sizeof(gre_wire_header));
-    *at<gre_wire_header>(&out, 0) = {to_be16(flags), to_be16(type)};
+    *header_at<gre_wire_header>(&out, 0) = {to_be16(flags), to_be16(type)};
     if (flags & GRE_CHECKSUM)
         out.resize(out.size() + sizeof(gre_wire_checksum));
     out.insert(out.end(), between.begin(), between.end());
     out.insert(out.end(), content.begin(), content.end());
     if (flags & GRE_CHECKSUM)
-        at<gre_wire_checksum>(&out, 4)->checksum = checksum_finish(checksum_add(0, out.data(), out.size()));
+        header_at<gre_wire_checksum>(&out, 4)->checksum =
+            checksum_finish(checksum_add(0, out.data(), out.size()));
     return out;
 }
 
@@ -91,12 +92,13 @@ TEST(ip_packet, checksums_are_sums_of_words) {
 
 TEST(gre, headers_are_taken_or_refused) {
     const bytes packet = make_packet(PROTOCOL_UDP, 1, 31), redirect = {0x80, 51, 7, 200};
-    bytes wrong = packet, cut = packet, padded = packet, corrupt = wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
+    bytes wrong = packet, cut = packet, padded = packet,
+          corrupt = wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
     wrong[8]++; // TTL, under the header's checksum
     cut.pop_back();
     padded.resize(packet.size() + 6);
     corrupt.back()++;
-    bytes stale = wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
+    bytes stale = wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
     stale[4]++;
     const struct {
         const char *what;
@@ -104,26 +106,26 @@ TEST(gre, headers_are_taken_or_refused) {
         refusal why;
         bool has_redirect = false, merged = false;
     } rows[] = {
-        {"plain", wrap(0, GRE_TYPE_IPV4, packet), REFUSALS},
-        {"padded", wrap(0, GRE_TYPE_IPV4, padded), REFUSALS},
-        {"redirected", wrap(0, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
-        {"redirected without header", wrap(0, GRE_TYPE_REDIRECT, packet), REFUSALS},
-        {"checksum", wrap(GRE_CHECKSUM, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
-        {"reserved bits", wrap(0x03f8, GRE_TYPE_IPV4, packet), REFUSALS},
+        {"plain", wrap_in_gre(0, GRE_TYPE_IPV4, packet), REFUSALS},
+        {"padded", wrap_in_gre(0, GRE_TYPE_IPV4, padded), REFUSALS},
+        {"redirected", wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
+        {"redirected without header", wrap_in_gre(0, GRE_TYPE_REDIRECT, packet), REFUSALS},
+        {"checksum", wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
+        {"reserved bits", wrap_in_gre(0x03f8, GRE_TYPE_IPV4, packet), REFUSALS},
         {"wrong checksum", corrupt, REFUSED_CHECKSUM},
         {"checksum of the first of several", stale, REFUSALS, false, true},
         {"checksum cut", {0x80, 0, 8, 0, 0, 0}, REFUSED_LENGTH},
-        {"routing", wrap(0x4000, GRE_TYPE_IPV4, packet), REFUSED_FLAGS},
-        {"key", wrap(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}), REFUSED_FLAGS},
-        {"sequence", wrap(0x1000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}), REFUSED_FLAGS},
-        {"version 1", wrap(1, GRE_TYPE_IPV4, packet), REFUSED_FLAGS},
-        {"IPv6", wrap(0, 0x86dd, packet), REFUSED_PROTOCOL},
+        {"routing", wrap_in_gre(0x4000, GRE_TYPE_IPV4, packet), REFUSED_FLAGS},
+        {"key", wrap_in_gre(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}), REFUSED_FLAGS},
+        {"sequence", wrap_in_gre(0x1000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}), REFUSED_FLAGS},
+        {"version 1", wrap_in_gre(1, GRE_TYPE_IPV4, packet), REFUSED_FLAGS},
+        {"IPv6", wrap_in_gre(0, 0x86dd, packet), REFUSED_PROTOCOL},
         {"header cut", {0, 0, 8}, REFUSED_LENGTH},
-        {"redirect header cut", wrap(0, GRE_TYPE_REDIRECT, {}, {0x80, 51, 7}), REFUSED_LENGTH},
-        {"nothing inside", wrap(0, GRE_TYPE_REDIRECT, {}, redirect), REFUSED_LENGTH},
-        {"redirect header under IPv4", wrap(0, GRE_TYPE_IPV4, packet, redirect), REFUSED_INNER},
-        {"inner checksum", wrap(0, GRE_TYPE_IPV4, wrong), REFUSED_INNER},
-        {"inner length", wrap(0, GRE_TYPE_IPV4, cut), REFUSED_INNER},
+        {"redirect header cut", wrap_in_gre(0, GRE_TYPE_REDIRECT, {}, {0x80, 51, 7}), REFUSED_LENGTH},
+        {"nothing inside", wrap_in_gre(0, GRE_TYPE_REDIRECT, {}, redirect), REFUSED_LENGTH},
+        {"redirect header under IPv4", wrap_in_gre(0, GRE_TYPE_IPV4, packet, redirect), REFUSED_INNER},
+        {"inner checksum", wrap_in_gre(0, GRE_TYPE_IPV4, wrong), REFUSED_INNER},
+        {"inner length", wrap_in_gre(0, GRE_TYPE_IPV4, cut), REFUSED_INNER},
     };
     for (bytes payload; const auto &row : rows) {
         SCOPED_TRACE(row.what);
@@ -159,12 +161,21 @@ TEST(gre, buckets_choose_who_gets_a_packet) {
         {"the other of the two", {0xc0, 51, 7, 200}, 0},
         {"nobody's bucket", {0x80, 51, 200, 7}, 0},
         {"another service", {0x80, 50, 200, 200}, 0},
-        {"another port", {0x80, 51, 7, 200}, 0, [](bytes *p) { tcp(p)->destination_port = to_be16(81); }},
-        {"from any port", {0x80, 52, 7, 200}, MEMBER, [](bytes *p) { tcp(p)->source_port = to_be16(0); }},
-        {"a new flow", {0x80, 51, 7, 200}, 0, [](bytes *p) { tcp(p)->flags = TCP_SYN; }},
-        {"its answer", {0x80, 51, 7, 200}, MEMBER, [](bytes *p) { tcp(p)->flags = TCP_SYN | TCP_ACK; }},
-        {"a fragment", {0x80, 51, 7, 200}, 0, [](bytes *p) { ip(p)->fragment = to_be16(0x2000); }},
-        {"a datagram", {0x80, 51, 7, 200}, 0, [](bytes *p) { ip(p)->protocol = PROTOCOL_UDP; }},
+        {"another port",
+         {0x80, 51, 7, 200},
+         0,
+         [](bytes *p) { tcp_header(p)->destination_port = to_be16(81); }},
+        {"from any port",
+         {0x80, 52, 7, 200},
+         MEMBER,
+         [](bytes *p) { tcp_header(p)->source_port = to_be16(0); }},
+        {"a new flow", {0x80, 51, 7, 200}, 0, [](bytes *p) { tcp_header(p)->flags = TCP_SYN; }},
+        {"its answer",
+         {0x80, 51, 7, 200},
+         MEMBER,
+         [](bytes *p) { tcp_header(p)->flags = TCP_SYN | TCP_ACK; }},
+        {"a fragment", {0x80, 51, 7, 200}, 0, [](bytes *p) { ip_header(p)->fragment = to_be16(0x2000); }},
+        {"a datagram", {0x80, 51, 7, 200}, 0, [](bytes *p) { ip_header(p)->protocol = PROTOCOL_UDP; }},
         {"cut within its header", {0x80, 51, 7, 200}, 0, [](bytes *p) { p->resize(39); }},
         {"no redirect header", {}, 0},
     };
@@ -172,8 +183,8 @@ TEST(gre, buckets_choose_who_gets_a_packet) {
         SCOPED_TRACE(row.what);
         bytes packet = make_packet(PROTOCOL_TCP, 1, 31);
         row.change(&packet);
-        mend(&packet);
-        bytes payload = wrap(0, GRE_TYPE_REDIRECT, packet, row.redirect);
+        fix_checksums(&packet);
+        bytes payload = wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, row.redirect);
         gre_content content;
         ASSERT_EQ(read_gre_payload(payload.data(), payload.size(), false, &content), REFUSALS);
         uint32_t local = 0;
@@ -194,7 +205,7 @@ void keep_write(void *, const iovec *parts, size_t count, uint32_t packets) {
 }
 
 // Packets through the coalescer into `writes`.
-void merge(const std::vector<bytes> &packets, bool udp = true) {
+void merge_packets(const std::vector<bytes> &packets, bool udp = true) {
     static coalescer merger;
     merger.sink = keep_write;
     merger.merge_udp = udp;
@@ -224,34 +235,34 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
         uint8_t protocol = PROTOCOL_TCP;
         bool mended = true; // after the change
     };
-    const auto reset_dont_fragment = [](bytes *p) { ip(p)->fragment = to_be16(0); };
+    const auto reset_dont_fragment = [](bytes *p) { ip_header(p)->fragment = to_be16(0); };
     const row rows[] = {
         {"next segment", [](bytes *) {}, 1},
-        {"next segment with PSH", [](bytes *p) { tcp(p)->flags |= TCP_PSH; }, 1},
+        {"next segment with PSH", [](bytes *p) { tcp_header(p)->flags |= TCP_PSH; }, 1},
         {"shorter", [](bytes *p) { p->resize(p->size() - 50); }, 1},
-        {"same id under DF", [](bytes *p) { ip(p)->id = to_be16(0xfffe); }, 1},
+        {"same id under DF", [](bytes *p) { ip_header(p)->id = to_be16(0xfffe); }, 1},
         {"longer", [](bytes *p) { p->resize(p->size() + 1); }},
         {"no payload", [](bytes *p) { p->resize(52); }},
-        {"source", [](bytes *p) { ip(p)->source.bytes[3]++; }},
-        {"destination", [](bytes *p) { ip(p)->destination.bytes[3]++; }},
-        {"source port", [](bytes *p) { tcp(p)->source_port.bytes[1]++; }},
-        {"destination port", [](bytes *p) { tcp(p)->destination_port.bytes[1]++; }},
-        {"acknowledgement", [](bytes *p) { tcp(p)->acknowledgement.bytes[3]++; }},
-        {"gap", [](bytes *p) { tcp(p)->sequence.bytes[3]++; }},
-        {"window", [](bytes *p) { tcp(p)->window.bytes[1]++; }},
-        {"id", [](bytes *p) { ip(p)->id.bytes[1]++; }},
-        {"TTL", [](bytes *p) { ip(p)->ttl--; }},
-        {"TOS", [](bytes *p) { ip(p)->tos = 3; }},
+        {"source", [](bytes *p) { ip_header(p)->source.bytes[3]++; }},
+        {"destination", [](bytes *p) { ip_header(p)->destination.bytes[3]++; }},
+        {"source port", [](bytes *p) { tcp_header(p)->source_port.bytes[1]++; }},
+        {"destination port", [](bytes *p) { tcp_header(p)->destination_port.bytes[1]++; }},
+        {"acknowledgement", [](bytes *p) { tcp_header(p)->acknowledgement.bytes[3]++; }},
+        {"gap", [](bytes *p) { tcp_header(p)->sequence.bytes[3]++; }},
+        {"window", [](bytes *p) { tcp_header(p)->window.bytes[1]++; }},
+        {"id", [](bytes *p) { ip_header(p)->id.bytes[1]++; }},
+        {"TTL", [](bytes *p) { ip_header(p)->ttl--; }},
+        {"TOS", [](bytes *p) { ip_header(p)->tos = 3; }},
         {"DF", reset_dont_fragment},
-        {"fragment", [](bytes *p) { ip(p)->fragment = to_be16(0x2000); }},
+        {"fragment", [](bytes *p) { ip_header(p)->fragment = to_be16(0x2000); }},
         {"TCP options", [](bytes *p) { (*p)[51]++; }},
-        {"length of TCP options", [](bytes *p) { tcp(p)->data_offset = 0x70; }},
-        {"FIN", [](bytes *p) { tcp(p)->flags |= TCP_FIN; }},
-        {"ECN echo", [](bytes *p) { tcp(p)->flags |= 0x40; }},
-        {"urgent", [](bytes *p) { tcp(p)->urgent = to_be16(1); }},
+        {"length of TCP options", [](bytes *p) { tcp_header(p)->data_offset = 0x70; }},
+        {"FIN", [](bytes *p) { tcp_header(p)->flags |= TCP_FIN; }},
+        {"ECN echo", [](bytes *p) { tcp_header(p)->flags |= 0x40; }},
+        {"urgent", [](bytes *p) { tcp_header(p)->urgent = to_be16(1); }},
         {"IP options",
          [](bytes *p) {
-             ip(p)->version_ihl = 0x46;
+             ip_header(p)->version_ihl = 0x46;
              p->insert(p->begin() + 20, 4, 1);
          }},
         {"TCP checksum", [](bytes *p) { p->back()++; }, 2, PROTOCOL_TCP, false},
@@ -265,23 +276,23 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
         std::vector<bytes> packets = {make_packet(row.protocol, 0, 100), make_packet(row.protocol, 1, 100)};
         row.change(&packets[1]);
         if (row.mended)
-            mend(&packets[1]);
-        merge(packets);
+            fix_checksums(&packets[1]);
+        merge_packets(packets);
         ASSERT_EQ(writes.size(), row.expected);
         EXPECT_TRUE(row.expected == 1 || writes[0].packet == packets[1] || writes[1].packet == packets[1]);
         // In reverse order: the properties of the first packet matter as well.
-        merge({packets[1], packets[0]});
+        merge_packets({packets[1], packets[0]});
         EXPECT_EQ(writes.size(), 2u);
     }
     // A first packet with a wrong checksum is not merged, but the others are.
     std::vector<bytes> three = {make_packet(PROTOCOL_TCP, 0, 100), make_packet(PROTOCOL_TCP, 1, 100),
                                 make_packet(PROTOCOL_TCP, 2, 100)};
     three[0].back()++;
-    merge(three);
+    merge_packets(three);
     ASSERT_EQ(writes.size(), 2u);
     EXPECT_EQ(writes[0].packet, three[0]);
     EXPECT_EQ(writes[1].packets, 2u);
-    merge({make_packet(PROTOCOL_UDP, 0, 100), make_packet(PROTOCOL_UDP, 1, 100)}, false);
+    merge_packets({make_packet(PROTOCOL_UDP, 0, 100), make_packet(PROTOCOL_UDP, 1, 100)}, false);
     EXPECT_EQ(writes.size(), 2u);
 }
 
@@ -291,12 +302,12 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
         for (uint32_t i = 0; i < 150; i++) // more than one large packet holds; ids and sequence numbers wrap
             packets.push_back(make_packet(protocol, i, 100));
         bytes other = make_packet(protocol, 0, 100); // another flow in between
-        ip(&other)->source.bytes[0] = 9;
-        mend(&other);
-        merge(packets);
+        ip_header(&other)->source.bytes[0] = 9;
+        fix_checksums(&other);
+        merge_packets(packets);
         ASSERT_EQ(writes.size(), 3u);
         EXPECT_EQ(split_writes(), packets);
-        merge({packets[0], other, packets[1], packets[2]});
+        merge_packets({packets[0], other, packets[1], packets[2]});
         ASSERT_EQ(writes.size(), 2u);
         EXPECT_EQ(writes[0].packets + writes[1].packets, 4u);
     }
@@ -304,12 +315,12 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
     std::vector<bytes> packets;
     for (uint32_t i = 0; i < 5; i++)
         packets.push_back(make_packet(PROTOCOL_TCP, i, i == 4 ? 30 : 100));
-    tcp(&packets[1])->flags |= TCP_PSH;
-    mend(&packets[1]);
-    merge(packets);
+    tcp_header(&packets[1])->flags |= TCP_PSH;
+    fix_checksums(&packets[1]);
+    merge_packets(packets);
     ASSERT_EQ(writes.size(), 2u);
     EXPECT_EQ(split_writes(), packets);
-    tcp(&writes[1].packet)->flags |= TCP_FIN | TCP_CWR;
+    tcp_header(&writes[1].packet)->flags |= TCP_FIN | TCP_CWR;
     const std::vector<bytes> split = split_writes();
     const auto flags = [&split](size_t i) { return split[i][33]; };
     ASSERT_EQ(split.size(), 5u);
@@ -319,7 +330,8 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
     // The partial checksum of a packet that is not large is completed; one beyond the packet's end is
     // refused.
     bytes packet = make_packet(PROTOCOL_TCP, 1, 11), partial = packet;
-    tcp(&partial)->checksum = checksum_fold(checksum_pseudo(*ip(&partial), partial.size() - 20));
+    tcp_header(&partial)->checksum =
+        checksum_fold(checksum_pseudo(*ip_header(&partial), partial.size() - 20));
     writes = {{{VIRTIO_NEEDS_CHECKSUM, 0, 0, 0, 20, 16}, partial, 1}};
     EXPECT_EQ(split_writes(), std::vector<bytes>({packet}));
     const virtio_header hostile[] = {
@@ -339,7 +351,7 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
 constexpr uint32_t APPLIANCE = 0x0a000001, ROUTER = 0x0a000002, STRANGER = 0x0a000003;
 constexpr size_t LARGE_DATAGRAM = 30000, PARTIAL_DATAGRAM = 501;
 
-void shell(const std::string &command) {
+void run_shell(const std::string &command) {
     ASSERT_EQ(system(command.c_str()), 0) << command;
 }
 
@@ -357,13 +369,13 @@ void send_gre(uint32_t source, const bytes &payload) {
 int send_by_hand() {
     const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
     const bytes packet = make_packet(PROTOCOL_UDP, 1, 1472), redirect = {0x80, 51, 7, 200};
-    send_gre(STRANGER, wrap(0, GRE_TYPE_IPV4, packet));
-    send_gre(ROUTER, wrap(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}));
+    send_gre(STRANGER, wrap_in_gre(0, GRE_TYPE_IPV4, packet));
+    send_gre(ROUTER, wrap_in_gre(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}));
     bytes large = make_packet(PROTOCOL_UDP, 2, LARGE_DATAGRAM); // larger than a frame of the ring
-    ip(&large)->destination = to_be32(0xc0a80901);
-    mend(&large);
-    send_gre(ROUTER, wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, large));
-    send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, packet, redirect));
+    ip_header(&large)->destination = to_be32(0xc0a80901);
+    fix_checksums(&large);
+    send_gre(ROUTER, wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, large));
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, redirect));
     pollfd waits = {back, POLLIN, 0};
     uint8_t got[2048];
     if (poll(&waits, 1, 3000) != 1)
@@ -371,9 +383,9 @@ int send_by_hand() {
     const ssize_t length = recv(back, got, sizeof got, 0);
     close(back);
     bytes expected = packet;
-    ip(&expected)->ttl--;
-    mend(&expected);
-    expected = wrap(0, GRE_TYPE_REDIRECT, expected, redirect);
+    ip_header(&expected)->ttl--;
+    fix_checksums(&expected);
+    expected = wrap_in_gre(0, GRE_TYPE_REDIRECT, expected, redirect);
     return length == static_cast<ssize_t>(20 + expected.size()) &&
                    memcmp(got + 20, expected.data(), expected.size()) == 0
                ? 0
@@ -383,11 +395,11 @@ int send_by_hand() {
 // Sends a datagram as a kernel on the same machine does, with a checksum that the device would complete.
 int send_partial() {
     bytes inner = make_packet(PROTOCOL_UDP, 3, PARTIAL_DATAGRAM);
-    ip(&inner)->destination = to_be32(0xc0a80901);
-    mend(&inner);
-    at<udp_wire_header>(&inner, 20)->checksum =
-        checksum_fold(checksum_pseudo(*ip(&inner), inner.size() - 20));
-    bytes packet = make_ip_packet(PROTOCOL_GRE, ROUTER, APPLIANCE, wrap(0, GRE_TYPE_IPV4, inner));
+    ip_header(&inner)->destination = to_be32(0xc0a80901);
+    fix_checksums(&inner);
+    header_at<udp_wire_header>(&inner, 20)->checksum =
+        checksum_fold(checksum_pseudo(*ip_header(&inner), inner.size() - 20));
+    bytes packet = make_ip_packet(PROTOCOL_GRE, ROUTER, APPLIANCE, wrap_in_gre(0, GRE_TYPE_IPV4, inner));
     ether_header ether = {{2, 0, 0, 0, 0, 1}, {2, 0, 0, 0, 0, 2}, htons(ETHERTYPE_IP)};
     virtio_header header = {VIRTIO_NEEDS_CHECKSUM, 0, 0, 0, sizeof ether + 20 + 4 + 20, 6};
     iovec parts[] = {{&header, sizeof header}, {&ether, sizeof ether}, {packet.data(), packet.size()}};
@@ -407,24 +419,24 @@ int send_for_shortcut() {
     const bytes redirect = {0x80, 51, 7, 200};
     const auto made = [](uint8_t protocol, size_t payload) {
         bytes packet = make_packet(protocol, 1, payload);
-        ip(&packet)->destination = to_be32(0xc0a80901);
-        mend(&packet);
+        ip_header(&packet)->destination = to_be32(0xc0a80901);
+        fix_checksums(&packet);
         return packet;
     };
     const bytes plain = made(PROTOCOL_UDP, 8);
     bytes corrupt = plain, fragment = plain, cut = plain;
-    ip(&corrupt)->ttl--;
-    ip(&fragment)->fragment = to_be16(0x2000);
-    mend(&fragment);
+    ip_header(&corrupt)->ttl--;
+    ip_header(&fragment)->fragment = to_be16(0x2000);
+    fix_checksums(&fragment);
     cut.pop_back();
     for (const bytes &content : {corrupt, fragment, cut, made(PROTOCOL_TCP, 8)})
-        send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, content, redirect));
-    send_gre(ROUTER, wrap(GRE_CHECKSUM, GRE_TYPE_IPV4, plain));
-    send_gre(ROUTER, wrap(0, 0x86dd, plain));
-    send_gre(STRANGER, wrap(0, GRE_TYPE_IPV4, plain));
-    send_gre(ROUTER, wrap(0, GRE_TYPE_IPV4, plain));
-    send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 9)));
-    send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 10), redirect));
+        send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, content, redirect));
+    send_gre(ROUTER, wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, plain));
+    send_gre(ROUTER, wrap_in_gre(0, 0x86dd, plain));
+    send_gre(STRANGER, wrap_in_gre(0, GRE_TYPE_IPV4, plain));
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_IPV4, plain));
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 9)));
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 10), redirect));
     return 0;
 }
 
@@ -451,12 +463,12 @@ int become_appliance(bool by_mask, std::string *out_error) {
 // Redirects a packet of a flow that neither appliance knows. The other one has to return it, once.
 int redirect_once() {
     const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
-    send_gre(ROUTER, wrap(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_TCP, 1, 9), {0x80, 51, 0, 9}));
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_TCP, 1, 9), {0x80, 51, 0, 9}));
     int count = 0;
     bytes got(2048);
     for (pollfd waits = {back, POLLIN, 0}; poll(&waits, 1, count ? 300 : 3000) == 1; count++)
-        if (recv(back, got.data(), got.size(), 0) < 60 || to_host(ip(&got)->source) != STRANGER ||
-            at<ip4_wire_header>(&got, 24)->ttl != 58)
+        if (recv(back, got.data(), got.size(), 0) < 60 || to_host(ip_header(&got)->source) != STRANGER ||
+            header_at<ip4_wire_header>(&got, 24)->ttl != 58)
             count += 10;
     close(back);
     return count == 1 ? 0 : 10 + count;
@@ -504,10 +516,10 @@ struct live_plane : testing::Test {
         close(answers[1]); // the child's death ends the wait for its answer
         ASSERT_TRUE(answered());
         const std::string pid = std::to_string(child), inside = "nsenter -t " + pid + " -n ip ";
-        shell("ip link add va address 02:00:00:00:00:01 type veth peer name vr netns " + pid);
-        shell("ip addr add 10.0.0.1/24 dev va && ip link set va up");
-        shell(inside + "addr add 10.0.0.2/24 dev vr && " + inside + "addr add 10.0.0.3/24 dev vr && " +
-              inside + "link set vr up");
+        run_shell("ip link add va address 02:00:00:00:00:01 type veth peer name vr netns " + pid);
+        run_shell("ip addr add 10.0.0.1/24 dev va && ip link set va up");
+        run_shell(inside + "addr add 10.0.0.2/24 dev vr && " + inside + "addr add 10.0.0.3/24 dev vr && " +
+                  inside + "link set vr up");
     }
     void TearDown() override {
         user_plane.close();
@@ -515,7 +527,8 @@ struct live_plane : testing::Test {
         std::string error;
         EXPECT_TRUE(user_plane.drop_link("wccp0", &error)) << error;
         EXPECT_EQ(if_nametoindex("wccp0"), 0u);
-        shell("ip link del va"); // while the child lives: the end of its namespace removes the device as well
+        run_shell(
+            "ip link del va"); // while the child lives: the end of its namespace removes the device as well
         close(commands[1]);
         close(answers[0]);
         kill(child, SIGKILL);
@@ -538,10 +551,11 @@ TEST_F(live_plane, delivers_and_returns_packets_of_each_kind) {
     const link_wish wish = {1, APPLIANCE, ROUTER};
     ASSERT_TRUE(user_plane.make_link("wccp0", wish, &index, &error)) << error;
     EXPECT_EQ(index, if_nametoindex("wccp0"));
-    shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && ip route add 203.0.113.0/24 dev "
-          "wccp0");
-    shell("cd /proc/sys/net/ipv4/conf && echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter && "
-          "echo 1 >wccp0/forwarding && echo 0 >wccp0/send_redirects");
+    run_shell(
+        "ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && ip route add 203.0.113.0/24 dev "
+        "wccp0");
+    run_shell("cd /proc/sys/net/ipv4/conf && echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter && "
+              "echo 1 >wccp0/forwarding && echo 0 >wccp0/send_redirects");
 
     const int datagrams = socket(AF_INET, SOCK_DGRAM | SOCK_NONBLOCK, 0);
     ASSERT_EQ(bind_to(datagrams, INADDR_ANY, 80), 0);
@@ -582,14 +596,14 @@ TEST_F(live_plane, delivers_and_returns_packets_of_each_kind) {
     close(datagrams);
 
     // An interface that was deleted is made again, and the thread does not spin until then.
-    shell("ip link del wccp0");
+    run_shell("ip link del wccp0");
     usleep(100000);
     const clock_t before = clock(); // processor time, of all threads
     usleep(300000);
     EXPECT_LT(clock() - before, CLOCKS_PER_SEC / 20);
     ASSERT_TRUE(user_plane.make_link("wccp0", wish, &again, &error)) << error;
     EXPECT_EQ(again, if_nametoindex("wccp0"));
-    shell("ip link set wccp0 up");
+    run_shell("ip link set wccp0 up");
 }
 
 TEST_F(live_plane, only_valid_udp_of_a_link_takes_the_shortcut) {
@@ -599,8 +613,8 @@ TEST_F(live_plane, only_valid_udp_of_a_link_takes_the_shortcut) {
     if (!shortcut_open(&shortcut, &error))
         GTEST_SKIP() << error;
     ASSERT_TRUE(tun_open("wccp0", &tun, &error)) << error;
-    shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && cd /proc/sys/net/ipv4/conf && "
-          "echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter");
+    run_shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && cd /proc/sys/net/ipv4/conf && "
+              "echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter");
     shortcut_follow_devices(&shortcut);
     EXPECT_EQ(shortcut.devices.size(), 2u); // va, wccp0
     shortcut_add_link(&shortcut, APPLIANCE, ROUTER, tun.index);

@@ -21,35 +21,35 @@ using strings = std::vector<std::string>;
 
 // --- Configuration as text
 
-static event_field field(const std::string &name, const std::string &text) {
+static event_field make_field(const std::string &name, const std::string &text) {
     return {name, {bn_type_str, text}};
 }
 
 TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
     const std::string one = NODE_INTERCEPT_CONFIG "/51", two = NODE_INTERCEPT_CONFIG "/7";
     std::vector<event_field> nodes = {
-        field(NODE_GROUP_CONFIG "/51/interface", "eth0"),
-        field(NODE_GROUP_CONFIG "/51/policy_grp", "70000"),
-        field(NODE_GROUP_CONFIG "/51/force_l2_return", "true"),
-        field(NODE_GROUP_CONFIG "/52/interface", "../../eth0"),
-        field(NODE_GROUP_CONFIG "/256/interface", "eth0"),
-        field(one + "/protocol", "udp"),
-        field(one + "/ports", "53 8000-8080"),
-        field(one + "/to", "3128"),
-        field(one + "/bypass", "10.1.2.3/8 10.0.0.300 192.0.2.1"),
-        field(one + "/check", "http"),
-        field(one + "/check_argument", "/health"),
-        field(one + "/interval", "0"),
-        field(one + "/down", "drop"),
-        field(two + "/protocol", "tcp"),
-        field(two + "/ports", "all"), // without a port of a proxy
-        field(NODE_BYPASS_CONFIG "/10.0.0.0\\/8", "10.0.0.0/8"),
-        field(NODE_BYPASS_CONFIG "/10.0.0.0\\/8/until", "99"),
-        field(NODE_BYPASS_CONFIG "/10.0.0.0\\/33", "10.0.0.0/33"),
-        field(NODE_ACCEPT_CONFIG "/192.0.2.9", "192.0.2.9"),
-        field(NODE_ACCEPT_CONFIG "/192.0.2.9/router", "192.0.2.1"),
-        field(NODE_ACCEPT_CONFIG "/somewhere", "somewhere"),
-        field(NODE_PROTECTION_TIME, "60"),
+        make_field(NODE_GROUP_CONFIG "/51/interface", "eth0"),
+        make_field(NODE_GROUP_CONFIG "/51/policy_grp", "70000"),
+        make_field(NODE_GROUP_CONFIG "/51/force_l2_return", "true"),
+        make_field(NODE_GROUP_CONFIG "/52/interface", "../../eth0"),
+        make_field(NODE_GROUP_CONFIG "/256/interface", "eth0"),
+        make_field(one + "/protocol", "udp"),
+        make_field(one + "/ports", "53 8000-8080"),
+        make_field(one + "/to", "3128"),
+        make_field(one + "/bypass", "10.1.2.3/8 10.0.0.300 192.0.2.1"),
+        make_field(one + "/check", "http"),
+        make_field(one + "/check_argument", "/health"),
+        make_field(one + "/interval", "0"),
+        make_field(one + "/down", "drop"),
+        make_field(two + "/protocol", "tcp"),
+        make_field(two + "/ports", "all"), // without a port of a proxy
+        make_field(NODE_BYPASS_CONFIG "/10.0.0.0\\/8", "10.0.0.0/8"),
+        make_field(NODE_BYPASS_CONFIG "/10.0.0.0\\/8/until", "99"),
+        make_field(NODE_BYPASS_CONFIG "/10.0.0.0\\/33", "10.0.0.0/33"),
+        make_field(NODE_ACCEPT_CONFIG "/192.0.2.9", "192.0.2.9"),
+        make_field(NODE_ACCEPT_CONFIG "/192.0.2.9/router", "192.0.2.1"),
+        make_field(NODE_ACCEPT_CONFIG "/somewhere", "somewhere"),
+        make_field(NODE_PROTECTION_TIME, "60"),
     };
     strings complaints;
     configured_view expected;
@@ -78,9 +78,9 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
         EXPECT_FALSE(read_configuration(nodes, &complaints).intercepts.contains(51)) << ports;
     }
     for (uint32_t i = 0; i < BYPASSES_MAX + 9; i++)
-        nodes.push_back(field(NODE_BYPASS_CONFIG "/10.1." + std::to_string(i / 256) + "." +
-                                  std::to_string(i % 256) + "\\/32",
-                              ""));
+        nodes.push_back(make_field(NODE_BYPASS_CONFIG "/10.1." + std::to_string(i / 256) + "." +
+                                       std::to_string(i % 256) + "\\/32",
+                                   ""));
     EXPECT_EQ(read_configuration(nodes, &complaints).bypasses.size(), BYPASSES_MAX);
     EXPECT_EQ(complaints.size(), COMPLAINTS_MAX);
 }

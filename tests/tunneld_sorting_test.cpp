@@ -27,7 +27,7 @@ struct packet {
     std::string text = "";
 };
 
-uint32_t get(const bytes &packet, size_t at, size_t size) {
+uint32_t number_at_offset(const bytes &packet, size_t at, size_t size) {
     uint32_t value = 0;
     for (size_t i = at; i < at + size && i < packet.size(); i++)
         value = value << 8 | packet[i];
@@ -54,13 +54,13 @@ constexpr uint32_t PASSED_ON = MARK_PASS + 9;
 int devices[DEVICES];
 uint16_t next_port = 20000;
 
-void give(device where, const bytes &sent) {
+void write_to_device(device where, const bytes &sent) {
     ASSERT_EQ(write(devices[where], sent.data(), sent.size()), static_cast<ssize_t>(sent.size()));
 }
 
 // The next packet from any device that `wanted` accepts. The kernel handles a packet, including the answer,
 // while it is written: waiting is necessary only on a busy machine.
-bytes take(const std::function<bool(const bytes &)> &wanted, device *out_where, int ms = 60) {
+bytes take_packet(const std::function<bool(const bytes &)> &wanted, device *out_where, int ms = 60) {
     pollfd fds[DEVICES];
     for (int i = 0; i < DEVICES; i++)
         fds[i] = {devices[i], POLLIN, 0};
@@ -76,9 +76,9 @@ bytes take(const std::function<bool(const bytes &)> &wanted, device *out_where, 
     return {};
 }
 
-void drain() {
+void drain_devices() {
     device where;
-    take([](const bytes &) { return false; }, &where, 0);
+    take_packet([](const bytes &) { return false; }, &where, 0);
 }
 
 int listen_on(int type, uint32_t address, uint16_t port) {
@@ -157,22 +157,23 @@ struct Sorting : testing::Test {
     static std::string send(packet what, device by = LINK, bytes *out_answer = nullptr) {
         if (what.from == 0)
             what.from = next_port++;
-        drain();
-        give(by, make_bytes(what));
+        drain_devices();
+        write_to_device(by, make_bytes(what));
         device where = DEVICES;
-        const bytes got = take(
+        const bytes got = take_packet(
             [&](const bytes &each) {
-                return each.size() >= 28 && (get(each, 20, 2) == what.from || get(each, 22, 2) == what.from);
+                return each.size() >= 28 && (number_at_offset(each, 20, 2) == what.from ||
+                                             number_at_offset(each, 22, 2) == what.from);
             },
             &where);
         char buffer[64];
         if (what.protocol == 17 && recv(udp, buffer, sizeof(buffer), 0) >= 0)
             return "datagram";
-        if (got.empty() || get(got, 20, 2) == what.from)
+        if (got.empty() || number_at_offset(got, 20, 2) == what.from)
             return got.empty() ? "" : device_names[where];
         if (out_answer)
             *out_answer = got;
-        return get(got, 33, 1) == (SYN | ACK) ? "answer" : "refused";
+        return number_at_offset(got, 33, 1) == (SYN | ACK) ? "answer" : "refused";
     }
     static int udp;
 };
@@ -305,8 +306,8 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
     packet next{.from = next_port++};
     bytes answer;
     ASSERT_EQ(send(next, LINK, &answer), "answer");
-    EXPECT_EQ(get(answer, 40, 4), 0x02040000u | wanted.mss); // the segment size fits the tunnel
-    EXPECT_EQ(counters().clamped, 1);
+    EXPECT_EQ(number_at_offset(answer, 40, 4), 0x02040000u | wanted.mss); // the segment size fits the tunnel
+    EXPECT_GE(counters().clamped, 1); // more when a socket repeats its answer
     // Later packets of the flow don't depend on the group's rules.
     wanted.groups[0].condition.proxy_up = false;
     wanted.bypasses = {{0, 0}};
@@ -314,7 +315,7 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
     apply(wanted);
     next.flags = ACK;
     next.sequence = 2;
-    next.acknowledged = get(answer, 24, 4) + 1;
+    next.acknowledged = number_at_offset(answer, 24, 4) + 1;
     EXPECT_EQ(send(next, MEMBER), ""); // from another appliance
     EXPECT_EQ(counters().interfaces["wccp9"][TO_PROXY].packets, 1);
     next.text = "hello";
@@ -351,12 +352,12 @@ TEST_F(Sorting, OuterPacketsAreCounted) {
     for (const bool drop : {false, true}) {
         wanted.drop_outer_gre = drop;
         apply(wanted);
-        drain();
-        give(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, gre));
-        EXPECT_EQ(take(is_icmp, &where).empty(), drop); // protocol unreachable: this kernel has no GRE
-        give(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER + 1, OWN, gre));
-        give(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, junk, 0x2000));
-        give(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, junk, 8));
+        drain_devices();
+        write_to_device(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, gre));
+        EXPECT_EQ(take_packet(is_icmp, &where).empty(), drop); // protocol unreachable: this kernel has no GRE
+        write_to_device(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER + 1, OWN, gre));
+        write_to_device(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, junk, 0x2000));
+        write_to_device(OUT, make_ip_packet(PROTOCOL_GRE, ROUTER, OWN, junk, 8));
     }
     sorting_counters read = counters();
     EXPECT_EQ(read.fragments, (std::map<tunnel_ends, uint64_t>{{{OWN, ROUTER}, 4}}));

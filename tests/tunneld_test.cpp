@@ -27,7 +27,7 @@ namespace {
 
 wccp_tunnel_mailbox *mailbox; // wccpd's mapping
 
-void give(uint16_t code, uint16_t id, uint32_t remote) {
+void give_command(uint16_t code, uint16_t id, uint32_t remote) {
     mailbox->command = 0;
     mailbox->tunnel_id = id;
     mailbox->local_ip = 0x0A000001;
@@ -146,7 +146,7 @@ TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
             EXPECT_FALSE(take_one(&desk)) << "nothing to do";
             lines();
         }
-        give(step.code, step.id, 0x0A000000 + step.remote);
+        give_command(step.code, step.id, 0x0A000000 + step.remote);
         mailbox->status = 77;
         EXPECT_EQ(take_one(&desk), step.status != 77);
         EXPECT_EQ(mailbox->command, step.status == 77 ? step.code : 0);
@@ -174,7 +174,7 @@ TEST_F(Tunneld, ACommandThatWasGivenUpGetsNoAnswer) {
                         {MAILBOX_DELETE_TUNNEL, 310, false},
                         {MAILBOX_ADD_TUNNEL, 310, true}};
     for (const auto &row : replacements) {
-        give(MAILBOX_ADD_TUNNEL, 310, 0x0A000002);
+        give_command(MAILBOX_ADD_TUNNEL, 310, 0x0A000002);
         mailbox->status = 77;
         take_replaced(&desk, row.id, row.code);
         EXPECT_EQ(mailbox->status, row.answered ? 0u : 77u) << row.code << " " << row.id;
@@ -194,17 +194,17 @@ TEST_F(Tunneld, AppliesEachChangeOfTheTable) {
                 tunnel.index = next++;
         made = *tunnels;
     };
-    give(MAILBOX_ADD_TUNNEL, 310, 0x0A000002);
+    give_command(MAILBOX_ADD_TUNNEL, 310, 0x0A000002);
     EXPECT_TRUE(take_one(&desk));
     EXPECT_EQ(mailbox->fmst_index, 40u);
-    give(MAILBOX_ADD_TUNNEL, 311, 0x0A000063); // fails
+    give_command(MAILBOX_ADD_TUNNEL, 311, 0x0A000063); // fails
     EXPECT_TRUE(take_one(&desk));
     EXPECT_EQ(mailbox->fmst_index, WCCP_NO_INDEX);
     EXPECT_EQ(made.size(), 1u);
-    give(MAILBOX_ADD_TUNNEL, 312, 0x0A000003);
+    give_command(MAILBOX_ADD_TUNNEL, 312, 0x0A000003);
     take_replaced(&desk, 312, 0);
     EXPECT_EQ(made.size(), 1u) << "the add that was withdrawn is undone";
-    give(MAILBOX_DELETE_TUNNEL, 310, 0x0A000002);
+    give_command(MAILBOX_DELETE_TUNNEL, 310, 0x0A000002);
     EXPECT_TRUE(take_one(&desk));
     EXPECT_TRUE(made.empty());
 }
@@ -224,7 +224,7 @@ TEST_F(Tunneld, OnlyTunnelsOfAnOlderWccpdHaveToBeOrderedAgain) {
             forget_wccpd();
         else if (*row.pid)
             std::ofstream(WCCPD_FILE) << row.pid << "\n";
-        give(MAILBOX_ADD_TUNNEL, 300, 0x0A000002); // before the first watch_wccpd()
+        give_command(MAILBOX_ADD_TUNNEL, 300, 0x0A000002); // before the first watch_wccpd()
         EXPECT_TRUE(take_one(&desk));
         watch_wccpd(&desk, now);
         drop_unordered(&desk, now + UNORDERED_MS - 1000);
@@ -274,8 +274,8 @@ std::string sorting_maps() {
     return maps.dump();
 }
 
-uint32_t order(uint16_t code, uint16_t id, uint32_t remote) {
-    give(code, id, remote);
+uint32_t order_tunnel(uint16_t code, uint16_t id, uint32_t remote) {
+    give_command(code, id, remote);
     wccp_wake_tunneld();
     for (int i = 0; i < 500 && mailbox->command != 0; i++)
         std::this_thread::sleep_for(10ms);
@@ -293,18 +293,18 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     ASSERT_TRUE(tunnel && beside && maps.find("goto") != std::string::npos) << maps;
 
     pid_t daemon = start_tunneld();
-    const uint32_t added = order(MAILBOX_ADD_TUNNEL, 4, 0x0A000004);
+    const uint32_t added = order_tunnel(MAILBOX_ADD_TUNNEL, 4, 0x0A000004);
     EXPECT_EQ(added, if_nametoindex("wccp2"));
     EXPECT_EQ(system("ip rule | grep -q 'iif wccp2 lookup 204803'"), 0);
     EXPECT_EQ(system("ip route show table 204803 | grep -q 'default dev wccp2'"), 0);
-    order(MAILBOX_DELETE_TUNNEL, 4, 0x0A000004);
+    order_tunnel(MAILBOX_DELETE_TUNNEL, 4, 0x0A000004);
     EXPECT_FALSE(if_nametoindex("wccp2"));
     EXPECT_EQ(if_nametoindex("wccp0"), tunnel);
     EXPECT_EQ(if_nametoindex("wccp1"), beside);
     EXPECT_EQ(sorting_maps(), maps);
     // An interface that was removed is made again by the next order, with a new index.
     EXPECT_EQ(system("ip link delete wccp0"), 0);
-    const uint32_t again = order(MAILBOX_ADD_TUNNEL, 3, 0x0A000002);
+    const uint32_t again = order_tunnel(MAILBOX_ADD_TUNNEL, 3, 0x0A000002);
     EXPECT_NE(again, tunnel);
     EXPECT_EQ(again, if_nametoindex("wccp0"));
     EXPECT_EQ(system("ip route show table 204801 | grep -q 'default dev wccp0'"), 0);
@@ -317,7 +317,7 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     daemon = start_tunneld(held.fd);
     std::this_thread::sleep_for(500ms);
     close(held.fd);
-    EXPECT_EQ(order(MAILBOX_ADD_TUNNEL, 3, 0x0A000002), again);
+    EXPECT_EQ(order_tunnel(MAILBOX_ADD_TUNNEL, 3, 0x0A000002), again);
     EXPECT_EQ(sorting_maps(), maps);
     // More wake-ups than its socket can queue don't block the sender, and commands are answered long before
     // the next regular look at the mailbox.
@@ -326,7 +326,7 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
         wccp_wake_tunneld();
     const int64_t began = lt_monotonic_ms();
     for (int i = 0; i < 10; i++)
-        order(MAILBOX_L2_RETURN, 0, 0);
+        order_tunnel(MAILBOX_L2_RETURN, 0, 0);
     EXPECT_LT(lt_monotonic_ms() - began, 1000);
     EXPECT_EQ(end_process(daemon, SIGTERM), 0);
     EXPECT_FALSE(std::filesystem::exists(WCCP_WAKE_UP_PATH));

@@ -15,7 +15,7 @@ static std::string proc_path(int fd) {
     return "/proc/" + std::to_string(getpid()) + "/fd/" + std::to_string(fd);
 }
 
-static sockaddr_in endpoint(const std::string &address, uint16_t port) {
+static sockaddr_in inet_endpoint(const std::string &address, uint16_t port) {
     sockaddr_in out = {};
     out.sin_family = AF_INET;
     out.sin_port = htons(port);
@@ -71,7 +71,7 @@ int peer_network::udp_socket(const std::string &address, uint16_t port) const {
     EXPECT_EQ(setns(home, CLONE_NEWNET), 0);
     const int on = 1;
     setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
-    const sockaddr_in local = endpoint(address, port);
+    const sockaddr_in local = inet_endpoint(address, port);
     EXPECT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&local), sizeof local), 0) << address;
     return fd;
 }
@@ -93,7 +93,7 @@ datagram receive_datagram(int fd, int wait_ms) {
 }
 
 void send_datagram(int fd, const std::string &to, uint16_t port, const std::vector<uint8_t> &bytes) {
-    const sockaddr_in remote = endpoint(to, port);
+    const sockaddr_in remote = inet_endpoint(to, port);
     EXPECT_EQ(
         sendto(fd, bytes.data(), bytes.size(), 0, reinterpret_cast<const sockaddr *>(&remote), sizeof remote),
         static_cast<ssize_t>(bytes.size()));
