@@ -238,7 +238,7 @@ void add_config_commands(command_line *line) {
 
 // The cause of a commit: the command, with its verb where it has one.
 std::string cause_of(const command_line &line) {
-    const std::string word = line.app.get_subcommands().front()->get_name();
+    std::string word = line.app.get_subcommands().front()->get_name();
     for (const char *begins : {"group", "policy", "intercept", "bypass", "tunnel"})
         if (word == begins && !line.words.empty())
             return word + " " + line.words.front();

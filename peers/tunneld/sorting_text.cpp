@@ -287,7 +287,7 @@ void add_reply_rules(content_maker &maker, const std::vector<const sorted_group 
                 set.elements[port_text(first, end.first)] = "";
             ports = "tcp sport @" + name + " ";
         }
-        out->push_back(NOT_JUST_SYN + (" " + ports) + pass);
+        out->push_back(format_text("%s %s%s", NOT_JUST_SYN, ports.c_str(), pass.c_str()));
     }
 }
 
@@ -414,10 +414,11 @@ void add_outer_chain(content_maker &maker) {
         true;
     for (const tunnel_ends &pair : maker.wanted.ends) {
         const std::string local = address_text(pair.local), remote = address_text(pair.remote);
-        const std::string counter = "fragments/" + local + "/" + remote;
+        const std::string counter = format_text("fragments/%s/%s", local.c_str(), remote.c_str());
+        const std::string both = format_text("%s . %s", remote.c_str(), local.c_str());
         maker.add_counter(counter);
-        fragments.elements[remote + " . " + local] = quote_name(counter);
-        ends.elements[remote + " . " + local] = "";
+        fragments.elements[both] = quote_name(counter);
+        ends.elements[both] = "";
         locals.elements[local] = "";
     }
     // Before -400, where the kernel reassembles fragments.
