@@ -560,7 +560,7 @@ lab_log() { # NODE
     tail -n +$((${LAB_MARKED[$1]-0} + 1)) "$LAB/$1.log"
 }
 lab_logged() { # NODE EXPRESSION
-    grep -Eq -- "$2" "$LAB/$1.log" && grep -Eq -- "$2" < <(lab_log "$1") # mostly only the first is needed
+    grep -Eq -- "$2" "$LAB/$1.log" && grep -Eq -- "$2" < <(lab_log "$1") # the second one runs only when there is a match
 }
 lab_wait_log() { # SECONDS NODE EXPRESSION
     lab_wait_until "$1" lab_logged "${@:2}" || { echo "lab: after $(($1 * LAB_PATIENCE)) s no line in the log of $2: $3" >&2; return 1; }
@@ -570,8 +570,8 @@ lab_manage() { # NODE WORDS...
     lab_in "$1" "$WCCP_BIN/mgmtctl" --json "${@:2}"
 }
 
-# Prints the nodes below a name as nested objects: /a/b/c/d below /a/b is {"c": {"d": VALUE}}. In lab_wait, prints what
-# LAB_SHAPE makes that of: the name, and the nodes as mgmtctl prints them.
+# Prints the nodes below a name as nested objects: /a/b/c/d below /a/b is {"c": {"d": VALUE}}. In lab_wait, which
+# sets LAB_WALKED, it prints the name and the nodes as mgmtctl does; LAB_SHAPE turns these into the objects.
 lab_tree() { # NODE NAME
     if [ -n "${LAB_WALKED-}" ]; then
         echo "{\"below\": \"${2%/}\"}"

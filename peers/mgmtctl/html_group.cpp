@@ -1,10 +1,11 @@
 // One group of the page: a summary line, which remains when the group is folded; then its reasons, routers,
 // appliances, and the table of each router beside the wanted one.
 #include "peers/mgmtctl/html_parts.h"
-#include "peers/mgmtctl/reasons.h"
 
 #include <algorithm>
 #include <numeric>
+
+#include "peers/mgmtctl/reasons.h"
 
 namespace {
 

@@ -263,7 +263,7 @@ int spawn_command(const std::string &file, pid_t *out_pid) {
 // Reaps a killed command if it ends before the deadline. Otherwise init reaps it after this program's end.
 void wait_for_killed(pid_t pid, int pidfd, int64_t deadline_ms) {
     pollfd end = {pidfd, POLLIN, 0};
-    if (pidfd >= 0) // poll() would sleep until the deadline
+    if (pidfd >= 0) // poll() ignores -1 and would sleep until the deadline
         (void)poll(&end, 1, static_cast<int>(std::max<int64_t>(deadline_ms - lt_monotonic_ms(), 0)));
     (void)waitpid(pid, nullptr, WNOHANG);
     if (pidfd >= 0)

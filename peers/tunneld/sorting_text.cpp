@@ -287,7 +287,9 @@ void add_reply_rules(content_maker &maker, const std::vector<const sorted_group 
                 set.elements[port_text(first, end.first)] = "";
             ports = "tcp sport @" + name + " ";
         }
-        out->push_back(format_text("%s %s%s", NOT_JUST_SYN, ports.c_str(), pass.c_str()));
+        std::string rule = NOT_JUST_SYN;
+        rule.append(" ").append(ports).append(pass);
+        out->push_back(std::move(rule));
     }
 }
 
@@ -584,7 +586,7 @@ std::string make_sorting_transaction(const nft_content &before, const nft_conten
             change.add("flush chain", name);
     }
     // A map whose type changes, as with another mask, is replaced. The rules that use it change as well and
-    // have been flushed. Types of an earlier tunneld have been compared before.
+    // have been flushed. The types that an earlier tunneld has left were compared before the call.
     const auto kept_set = [&before](const std::string &name, const nft_set &wanted) {
         const nft_set *old = find_in(before.sets, name);
         return old && (!before.known || old->declaration == wanted.declaration) ? old : nullptr;
