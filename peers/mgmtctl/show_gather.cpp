@@ -409,9 +409,13 @@ bool gather_processes(gathering *work) {
         return false;
     for (const ctl_binding &binding : reply.bindings) {
         const std::vector<std::string> parts = parts_below(NODE_PROCESSES, binding.name);
-        if (parts.empty() || work->shown.processes.size() > PROCESSES_MAX)
+        if (parts.empty())
             continue;
-        snapshot_process *process = &work->shown.processes[clean_text(parts[0], 15)];
+        auto &processes = work->shown.processes;
+        const std::string name = clean_text(parts[0], 15);
+        if (processes.size() >= PROCESSES_MAX && !processes.contains(name))
+            continue;
+        snapshot_process *process = &processes[name];
         if (parts.size() == 1)
             process->running = binding.value == "running";
         else if (parts[1] == "since")
