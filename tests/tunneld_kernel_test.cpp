@@ -16,6 +16,7 @@
 #include "peers/tunneld/kernel_state.h"
 #include "peers/tunneld/link_names.h"
 #include "peers/tunneld/sorting_rules.h"
+#include "peers/tunneld/user_tun.h"
 #include "tests/support/test_host.h"
 
 // Replaces the rules that sort packets. It checks that the tables to which they send packets exist before the
@@ -24,16 +25,17 @@ static wanted_sorting sorted;
 static bool needs_are_met(const wanted_sorting &sorting) {
     std::vector<found_rule> rules;
     std::vector<found_route> routes;
+    std::set<uint32_t> routed;
+    std::set<std::pair<std::string, uint32_t>> looked_up;
     if (find_rules(&rules) || find_routes(&routes))
         return false;
+    for (const found_route &one : routes)
+        routed.insert(one.route.table);
+    for (const found_rule &one : rules)
+        looked_up.insert({one.rule.in_interface, one.rule.table});
     return std::all_of(sorting.links.begin(), sorting.links.end(), [&](const std::string &name) {
         const uint32_t table = TABLE_LINK_FIRST + *link_number(name);
-        return if_nametoindex(name.c_str()) &&
-               std::any_of(routes.begin(), routes.end(),
-                           [&](const found_route &one) { return one.route.table == table; }) &&
-               std::any_of(rules.begin(), rules.end(), [&](const found_rule &one) {
-                   return one.rule.table == table && one.rule.in_interface == name;
-               });
+        return if_nametoindex(name.c_str()) && routed.contains(table) && looked_up.contains({name, table});
     });
 }
 [[gnu::weak]] bool apply_sorting_rules(const wanted_sorting &wanted, std::string *out_error) {
@@ -73,7 +75,7 @@ std::string describe_rule(const wanted_rule &rule) {
     return text;
 }
 
-std::set<std::string> describe_wanted(const wanted_state &wanted) {
+std::set<std::string> links_and_tables(const wanted_state &wanted) {
     std::set<std::string> lines;
     for (const auto &link : wanted.links)
         lines.insert("link " + link.name + " " + link_alias(link.wish));
@@ -81,6 +83,10 @@ std::set<std::string> describe_wanted(const wanted_state &wanted) {
         lines.insert(describe_rule(rule));
     for (const auto &route : wanted.routes)
         lines.insert(describe_route(route));
+    return lines;
+}
+std::set<std::string> describe_wanted(const wanted_state &wanted) {
+    std::set<std::string> lines = links_and_tables(wanted);
     for (const auto &setting : wanted.settings)
         lines.insert("setting " + setting.path + " " + setting.value + (setting.restore ? " restored" : ""));
     const wanted_sorting &sorting = wanted.sorting;
@@ -268,23 +274,15 @@ TEST(link_names, only_ours_are_read) {
 
 // --- The kernel
 
-std::map<std::string, int> tuns;
-
 bool make_tun(const std::string &name, const link_wish &, uint32_t *out_index, std::string *) {
-    if (!tuns.count(name)) {
-        EXPECT_GE(tuns[name] = open_tun(name), 0);
+    static std::map<std::string, uint32_t> held; // indices of the interfaces that this process has opened
+    if (!held[name] || held[name] != if_nametoindex(name.c_str())) {
+        EXPECT_GE(open_tun(name), 0);
     }
-    *out_index = if_nametoindex(name.c_str());
+    *out_index = held[name] = if_nametoindex(name.c_str());
     return true;
 }
-bool drop_tun(const std::string &name, std::string *) {
-    if (const auto found = tuns.extract(name)) {
-        ioctl(found.mapped(), TUNSETPERSIST, 0);
-        close(found.mapped());
-    }
-    return true;
-}
-const data_plane tun_plane = {"tun", nullptr, nullptr, nullptr, make_tun, drop_tun, nullptr};
+const data_plane tun_plane = {"tun", nullptr, nullptr, nullptr, make_tun, remove_interface, nullptr};
 
 // Runs a program that does not clean up.
 void run_program(const std::function<void()> &steps) {
@@ -296,29 +294,25 @@ void run_program(const std::function<void()> &steps) {
         << "see above";
 }
 
-std::string setting_file(const std::string &path) {
-    return "/proc/sys/net/ipv4/conf/" + path;
-}
+const std::string SETTINGS = "/proc/sys/net/ipv4/conf/";
 void put_setting(const std::string &path, const std::string &value) {
-    std::ofstream(setting_file(path)) << value;
+    std::ofstream(SETTINGS + path) << value;
 }
 // The values of several settings, each of which is one character.
 std::string read_settings(const strings &paths) {
     std::string values, value;
     for (const auto &path : paths) {
-        std::ifstream(setting_file(path)) >> value;
+        std::ifstream(SETTINGS + path) >> value;
         values += value;
     }
     return values;
 }
 
-// The kernel's route for a packet.
-std::string route_of(const std::string &arguments) {
-    FILE *ip = popen(("ip route get 198.51.100.1 from 203.0.113.1 " + arguments + " 2>&1").c_str(), "r");
-    char text[200] = "";
-    EXPECT_TRUE(fgets(text, sizeof text, ip)) << arguments;
-    pclose(ip);
-    return text;
+// Whether the kernel's route for a packet contains the text.
+bool is_routed(const std::string &arguments, const std::string &text) {
+    return system(
+               ("ip route get 198.51.100.1 from 203.0.113.1 " + arguments + " 2>&1 | grep -q '" + text + "'")
+                   .c_str()) == 0;
 }
 
 // Counts the kernel's notifications about links, addresses, routes, rules and settings during the steps.
@@ -345,7 +339,7 @@ std::string reconcile_kernel(const wanted_state &wanted, const data_plane &plane
     return error;
 }
 
-// Everything in the kernel that tunneld has made, as describe() prints it.
+// Everything in the kernel that tunneld has made, as links_and_tables() describes it.
 std::set<std::string> find_ours() {
     std::set<std::string> lines;
     std::vector<found_link> links;
@@ -363,13 +357,6 @@ std::set<std::string> find_ours() {
         lines.insert(describe_route(one.route) + (one.odd ? " odd" : ""));
     return lines;
 }
-std::set<std::string> links_and_tables(const wanted_state &wanted) {
-    std::set<std::string> lines;
-    for (const auto &line : describe_wanted(wanted))
-        if (line.starts_with("link ") || line.starts_with("rule ") || line.starts_with("route "))
-            lines.insert(line);
-    return lines;
-}
 void reconcile_all(const wanted_state &wanted, const data_plane &plane = tun_plane) {
     EXPECT_EQ(reconcile_kernel(wanted, plane), "");
     EXPECT_EQ(find_ours(), links_and_tables(wanted));
@@ -381,12 +368,10 @@ void remove_all(const data_plane &plane = tun_plane) {
 }
 
 // Provides an interface "eth0" that is not tunneld's.
-class kernel_state : public ::testing::Test {
-protected:
+struct kernel_state : testing::Test {
+    const int lan = open_tun("eth0");
     void SetUp() override {
-        ASSERT_EQ(geteuid(), 0u) << "run by lab/in-appliance";
-        lan = open_tun("eth0");
-        ASSERT_GE(lan, 0);
+        ASSERT_GE(lan, 0) << "run by lab/in-appliance";
         ASSERT_EQ(system("ip address add 10.0.0.101/24 dev eth0 && ip link set eth0 up && "
                          "ip route add default via 10.0.0.254"),
                   0);
@@ -399,7 +384,6 @@ protected:
         ioctl(lan, TUNSETPERSIST, 0);
         close(lan);
     }
-    int lan = -1;
 };
 
 TEST_F(kernel_state, made_once_followed_and_removed) {
@@ -412,9 +396,9 @@ TEST_F(kernel_state, made_once_followed_and_removed) {
         for (const auto &setting : wanted.settings)
             EXPECT_EQ(read_settings({setting.path}), setting.value) << setting.path;
 
-        EXPECT_NE(route_of("iif wccp0").find("table 204801"), std::string::npos) << route_of("iif wccp0");
-        EXPECT_EQ(route_of("iif wccp0 mark 0x57430001").find("local "), 0u);
-        EXPECT_NE(route_of("iif wccp0 mark 0x57430002").find("dev eth0"), std::string::npos);
+        EXPECT_TRUE(is_routed("iif wccp0", "table 204801"));
+        EXPECT_TRUE(is_routed("iif wccp0 mark 0x57430001", "^local "));
+        EXPECT_TRUE(is_routed("iif wccp0 mark 0x57430002", "dev eth0"));
 
         EXPECT_EQ(count_changes([&] { EXPECT_EQ(reconcile_kernel(wanted), ""); }), 0);
 
@@ -450,12 +434,10 @@ TEST_F(kernel_state, what_a_killed_program_leaves_is_taken_over) {
     run_program([&] { EXPECT_EQ(reconcile_kernel(make_wanted_state(view, {}, true)), ""); });
     // A link whose program has died does not lose packets: they are routed like others once the kernel has
     // noticed.
-    std::string route;
-    for (int i = 0; i < 150 && route.find("dev eth0") == std::string::npos; i++) {
+    const auto is_noticed = [] { return is_routed("iif eth0 mark 0x57430100", "dev eth0"); };
+    for (int i = 0; i < 150 && !is_noticed(); i++)
         usleep(20000);
-        route = route_of("iif eth0 mark 0x57430100");
-    }
-    EXPECT_NE(route.find("dev eth0"), std::string::npos) << route;
+    EXPECT_TRUE(is_noticed());
     // A link without a mark, one with an invalid alias, one that is not tunneld's, and rules and routes that
     // are not wanted.
     for (const char *name : {"wccp5", "wccp7", "tun3"})
