@@ -46,11 +46,10 @@ struct bench {
     output out;
 
     bench() { self.options.self = ROUTER; }
-    const bytes &send(address from, const bytes &data) {
+    bytes send(address from, const bytes &data) {
         out = {};
         router_receive(&self, 0, from, ROUTER, data, &out);
-        static const bytes none;
-        return out.send.empty() ? none : out.send.back().data;
+        return out.send.empty() ? bytes() : out.send.back().data;
     }
     std::string result_of(address from, const bytes &data) {
         send(from, data);

@@ -16,7 +16,6 @@
 #include <thread>
 
 #include "platform/qvcommon.h"
-#include "platform/qvcommon_transport.h"
 
 using namespace std::chrono_literals;
 
@@ -206,25 +205,6 @@ const struct {
      "sleep .1 && ip link set va nomaster && ip link del bridge0",
      "bridge0 0/0", "va 0/0"},
 };
-
-int transported;
-
-} // namespace
-
-extern "C" int qv_state_event_transport(uint32_t one, const char *group_id, uint32_t role,
-                                        const uint8_t *code, gcl_session *) {
-    EXPECT_TRUE(one == 1 && strcmp(group_id, "51") == 0 && role == 1 && *code == 237);
-    return transported++; // accepts the first
-}
-
-namespace {
-
-TEST(Closed, StateEventsArePassedToTheProgram) {
-    const uint8_t code = 237;
-    for (const int result : {0, -1, -2}) // those that are not accepted are counted
-        EXPECT_EQ(qv_state_event_send(1, "51", 1, &code, nullptr), result);
-    EXPECT_EQ(transported, 3);
-}
 
 // The texts of the engine show that of an address.
 TEST(Closed, AddressText) {

@@ -18,6 +18,7 @@
 #include "peers/tunneld/sorting_rules.h"
 #include "peers/tunneld/user_tun.h"
 #include "tests/support/test_host.h"
+#include "tests/support/texts.h"
 
 // Replaces the rules that sort packets. It checks that the tables to which they send packets exist before the
 // rules are added, and until they are removed.
@@ -49,8 +50,6 @@ static bool needs_are_met(const wanted_sorting &sorting) {
 }
 
 namespace {
-
-using strings = std::vector<std::string>;
 
 // --- The wanted state
 
@@ -284,27 +283,15 @@ bool make_tun(const std::string &name, const link_wish &, uint32_t *out_index, s
 }
 const data_plane tun_plane = {"tun", nullptr, nullptr, nullptr, make_tun, remove_interface, nullptr};
 
-// Runs a program that does not clean up.
-void run_program(const std::function<void()> &steps) {
-    EXPECT_EQ(wait_for_child(start_child([&] {
-                  steps();
-                  return testing::Test::HasFailure() ? 1 : 0;
-              })),
-              0)
-        << "see above";
-}
-
 const std::string SETTINGS = "/proc/sys/net/ipv4/conf/";
 void put_setting(const std::string &path, const std::string &value) {
     std::ofstream(SETTINGS + path) << value;
 }
 // The values of several settings, each of which is one character.
 std::string read_settings(const strings &paths) {
-    std::string values, value;
-    for (const auto &path : paths) {
-        std::ifstream(SETTINGS + path) >> value;
-        values += value;
-    }
+    std::string values;
+    for (const auto &path : paths)
+        values += text_of_file(SETTINGS + path)[0];
     return values;
 }
 

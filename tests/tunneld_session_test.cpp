@@ -261,14 +261,12 @@ struct Session : Mgmtd, ticking_loop {
                 fields.push_back(make_field(name, text));
             };
             int walks = 0;
-            for (uint32_t n = 0; n < bn_request_per_node_array_length_quick(msg->nodes); n++) {
-                const bn_request_node *node = bn_request_per_node_array_get_quick(msg->nodes, n);
-                const std::string name = name_of(node->binding);
+            for (const auto &[name, value] : fields_of(msg)) {
                 for (int group = 31; group <= 51 && name == NODE_GROUP_STATE; group++)
                     add(name + "/" + std::to_string(group), std::to_string(group));
                 if (name == NODE_GROUP_STATE "/51/owners")
                     add(name, "hash members 192.0.2.3");
-                if (name.ends_with("/router") && node->subop == bn_query_iterate) {
+                if (name.ends_with("/router")) {
                     add(name + "/1/id", "192.0.2.1");
                     add(name + "/1/ipaddr", "192.0.2.2");
                     add(name + "/1/fwd_method", method == "L2" ? "GRE" : method);

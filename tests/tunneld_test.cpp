@@ -5,19 +5,14 @@
 #include <sched.h>
 #include <signal.h>
 #include <sys/prctl.h>
-#include <sys/shm.h>
 
 #include <chrono>
-#include <filesystem>
-#include <fstream>
-#include <thread>
 
 #include "peers/tunneld/kernel_state.h"
 #include "peers/tunneld/tunneld.h"
 #include "peers/tunneld/user_tun.h"
-#include "platform/tunnel_mailbox.h"
-#include "runtime/cmem.h"
 #include "runtime/ttime.h"
+#include "tests/support/fake_tunneld.h"
 #include "tests/support/test_host.h"
 #include "tests/support/texts.h"
 
@@ -39,12 +34,6 @@ void give_command(uint16_t code, uint16_t id, uint32_t remote) {
 bool take_one(command_desk *desk) {
     bool end = false;
     return take_command(desk, &end);
-}
-
-void write_mem_conf() {
-    const std::filesystem::path conf = CMEM_CONF_PATH;
-    std::filesystem::create_directories(conf.parent_path());
-    std::ofstream(conf) << WCCP_MAILBOX_NAME << " local normal 0x51520001\n";
 }
 
 struct Tunneld : testing::Test {
@@ -69,17 +58,17 @@ struct Tunneld : testing::Test {
 // Has to be the first test: the mailbox is not attached yet. The child has its own shared memory.
 TEST(Mailbox, ABlockThatIsTooShortIsNotUsed) {
     write_mem_conf();
-    const pid_t child = start_child([] {
-        if (unshare(CLONE_NEWIPC) != 0 || !cmem_create_block(4096, WCCP_MAILBOX_NAME))
-            return 2;
-        const bool refused = !wccp_attach_mailbox() && wccp_get_tunnel_command() == 0 && !wccp_mailbox &&
-                             wccp_get_role(65535) == 2;
-        const int key = shmget(0x51520001, 0, 0);
+    run_program([] {
+        ASSERT_EQ(unshare(CLONE_NEWIPC), 0);
+        ASSERT_TRUE(cmem_create_block(4096, WCCP_MAILBOX_NAME));
+        EXPECT_FALSE(wccp_attach_mailbox());
+        EXPECT_EQ(wccp_get_tunnel_command(), 0);
+        EXPECT_FALSE(wccp_mailbox);
+        EXPECT_EQ(wccp_get_role(65535), 2u);
         shmid_ds segment;
-        const bool let_go = shmctl(key, IPC_STAT, &segment) == 0 && segment.shm_nattch == 1;
-        return refused && let_go ? 0 : 1;
+        ASSERT_EQ(shmctl(shmget(0x51520001, 0, 0), IPC_STAT, &segment), 0);
+        EXPECT_EQ(segment.shm_nattch, 1u) << "it is not detached";
     });
-    EXPECT_EQ(wait_for_child(child), 0);
 }
 
 TEST_F(Tunneld, KeepsATableAndAnswersEachCommand) {
@@ -206,10 +195,6 @@ TEST_F(Tunneld, OnlyTunnelsOfAnOlderWccpdHaveToBeOrderedAgain) {
 
 namespace {
 
-int end_process(pid_t child, int signal) {
-    kill(child, signal);
-    return wait_for_child(child);
-}
 pid_t start_tunneld(int unshared_fd = -1) {
     return start_child([unshared_fd] {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
@@ -219,7 +204,7 @@ pid_t start_tunneld(int unshared_fd = -1) {
 }
 
 // Leaves the state of a killed tunneld: a tunnel, an accepted source, and a group with an intercept.
-int leave_a_tunnel() {
+void leave_a_tunnel() {
     std::string error;
     appliance_view view;
     view.tunnels = {{3, {0x0A000001, 0x0A000002}}};
@@ -228,10 +213,9 @@ int leave_a_tunnel() {
     view.conditions[61] = {true, true};
     view.accepted = {{0x0A000009, 0}};
     std::map<std::string, uint32_t> indices;
-    const bool done = user_plane.open(&error) &&
-                      reconcile_kernel_state(user_plane, make_wanted_state(view, {}, true), &indices, &error);
-    fprintf(stderr, "%s", error.c_str());
-    return done ? 0 : 1;
+    ASSERT_TRUE(user_plane.open(&error)) << error;
+    ASSERT_TRUE(reconcile_kernel_state(user_plane, make_wanted_state(view, {}, true), &indices, &error))
+        << error;
 }
 
 std::string sorting_maps() {
@@ -252,7 +236,7 @@ uint32_t order_tunnel(uint16_t code, uint16_t id, uint32_t remote) {
 
 TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     ASSERT_EQ(system("ip address add 10.0.0.1/24 dev lo"), 0);
-    ASSERT_EQ(wait_for_child(start_child(leave_a_tunnel)), 0);
+    run_program(leave_a_tunnel);
     const std::string maps = sorting_maps();
     const unsigned tunnel = if_nametoindex("wccp0"), beside = if_nametoindex("wccp1");
     ASSERT_TRUE(tunnel && beside && contains(maps, "goto")) << maps;
@@ -273,7 +257,8 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     EXPECT_NE(again, tunnel);
     EXPECT_EQ(again, if_nametoindex("wccp0"));
     EXPECT_EQ(system("ip route show table 204801 | grep -q 'default dev wccp0'"), 0);
-    end_process(daemon, SIGKILL);
+    kill(daemon, SIGKILL);
+    wait_for_child(daemon);
 
     // A link that cannot be taken over yet is taken over later.
     tun_device held;
@@ -293,7 +278,8 @@ TEST_F(Tunneld, ASuccessorServesFlowsAndCommandsBeforeItHasAConfiguration) {
     for (int i = 0; i < 10; i++)
         order_tunnel(MAILBOX_L2_RETURN, 0, 0);
     EXPECT_LT(lt_monotonic_ms() - began, 1000);
-    EXPECT_EQ(end_process(daemon, SIGTERM), 0);
+    kill(daemon, SIGTERM);
+    EXPECT_EQ(wait_for_child(daemon), 0);
     EXPECT_FALSE(std::filesystem::exists(WCCP_WAKE_UP_PATH));
     wccp_wake_tunneld(); // without a receiver
     close(free_descriptor);
