@@ -4,11 +4,9 @@
 
 #include <gtest/gtest.h>
 #include <linux/rtnetlink.h>
-#include <sys/mount.h>
 
 #include <algorithm>
 #include <filesystem>
-#include <fstream>
 #include <set>
 
 #include "peers/tunneld/kernel_links.h"
@@ -89,8 +87,11 @@ std::set<std::string> describe_wanted(const wanted_state &wanted) {
     for (const auto &setting : wanted.settings)
         lines.insert("setting " + setting.path + " " + setting.value + (setting.restore ? " restored" : ""));
     const wanted_sorting &sorting = wanted.sorting;
-    for (const auto &name : sorting.l2_interfaces)
-        lines.insert("l2 " + name);
+    for (const auto &[word, names] : {std::pair{"l2 ", &sorting.l2_interfaces},
+                                      {"member ", &sorting.members},
+                                      {"passing ", &sorting.passing}})
+        for (const auto &name : *names)
+            lines.insert(word + name);
     for (const auto &[name, mark] : sorting.l2_into_gre)
         lines.insert("l2 " + name + " into " + std::to_string(mark - MARK_RETURN));
     for (const auto &ends : sorting.ends)
@@ -103,10 +104,6 @@ std::set<std::string> describe_wanted(const wanted_state &wanted) {
             line += mark ? " " + std::to_string(mark - MARK_PASS) : " -";
         lines.insert(line + (group.rules.to ? "" : " unwanted"));
     }
-    for (const auto &name : sorting.members)
-        lines.insert("member " + name);
-    for (const auto &name : sorting.passing)
-        lines.insert("passing " + name);
     for (const auto &[id, group] : wanted.passing)
         lines.insert("bucket 9 of " + std::to_string(id) + " to " + address_text(group.members[9]) +
                      (group.by_source_port ? " by source" : ""));
@@ -297,9 +294,8 @@ std::string read_settings(const strings &paths) {
 
 // Whether the kernel's route for a packet contains the text.
 bool is_routed(const std::string &arguments, const std::string &text) {
-    return system(
-               ("ip route get 198.51.100.1 from 203.0.113.1 " + arguments + " 2>&1 | grep -q '" + text + "'")
-                   .c_str()) == 0;
+    const std::string find_route = "ip route get 198.51.100.1 from 203.0.113.1 " + arguments;
+    return system((find_route + " 2>&1 | grep -q '" + text + "'").c_str()) == 0;
 }
 
 // Counts the kernel's notifications about links, addresses, routes, rules and settings during the steps.
@@ -360,11 +356,10 @@ struct kernel_state : testing::Test {
     void SetUp() override {
         ASSERT_GE(lan, 0) << "run by lab/in-appliance";
         ASSERT_EQ(system("ip address add 10.0.0.101/24 dev eth0 && ip link set eth0 up && "
-                         "ip route add default via 10.0.0.254"),
+                         "ip route add default via 10.0.0.254 && cd /proc/sys/net/ipv4/conf && "
+                         "for key in rp_filter send_redirects; do "
+                         "echo 1 >all/$key && echo 0 >default/$key && echo 0 >eth0/$key || exit; done"),
                   0);
-        for (const char *key : {"rp_filter", "send_redirects"})
-            for (const char *interface : {"all", "default", "eth0"})
-                put_setting(std::string(interface) + "/" + key, strcmp(interface, "all") == 0 ? "1" : "0");
     }
     void TearDown() override {
         run_program([] { remove_all(); });
@@ -492,11 +487,10 @@ TEST_F(kernel_state, failures_are_reported_and_the_rest_is_done) {
         view.groups[61].interface = "eth7"; // does not exist
         view.groups[61].force_l2_return = true;
         const auto wanted = make_wanted_state(view, {}, true);
-        ASSERT_EQ(mount("/proc/sys", "/proc/sys", nullptr, MS_BIND, nullptr), 0);
-        ASSERT_EQ(mount(nullptr, "/proc/sys", nullptr, MS_BIND | MS_REMOUNT | MS_RDONLY, nullptr), 0);
+        ASSERT_EQ(system("mount --bind /proc/sys /proc/sys && mount -o remount,ro,bind /proc/sys"), 0);
         EXPECT_EQ(reconcile_kernel(wanted),
                   "cannot set /proc/sys/net/ipv4/conf/default/rp_filter to 1: Read-only file system");
-        EXPECT_EQ(umount("/proc/sys"), 0);
+        EXPECT_EQ(system("umount /proc/sys"), 0);
         auto expected = links_and_tables(wanted);
         EXPECT_EQ(expected.erase("route 204801 eth7 via 10.0.0.17"), 1u);
         EXPECT_EQ(find_ours(), expected);

@@ -6,7 +6,6 @@
 #include <netpacket/packet.h>
 #include <poll.h>
 #include <sched.h>
-#include <sys/mount.h>
 
 #include <ctime>
 
@@ -91,11 +90,9 @@ TEST(ip_packet, checksums_are_sums_of_words) {
 
 TEST(gre, headers_are_taken_or_refused) {
     const bytes packet = make_packet(PROTOCOL_UDP, 1, 31);
-    bytes wrong = packet, cut = packet, padded = packet,
-          corrupt = wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
+    bytes wrong = packet, cut = packet, corrupt = wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
     wrong[8]++; // TTL, under the header's checksum
     cut.pop_back();
-    padded.resize(packet.size() + 6);
     corrupt.back()++;
     bytes stale = wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
     stale[4]++;
@@ -106,7 +103,7 @@ TEST(gre, headers_are_taken_or_refused) {
         bool has_redirect = false, merged = false;
     } rows[] = {
         {"plain", wrap_in_gre(0, GRE_TYPE_IPV4, packet), REFUSALS},
-        {"padded", wrap_in_gre(0, GRE_TYPE_IPV4, padded), REFUSALS},
+        {"padded", wrap_in_gre(0, GRE_TYPE_IPV4, bytes(6), packet), REFUSALS},
         {"redirected", wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, REDIRECT), REFUSALS, true},
         {"redirected without header", wrap_in_gre(0, GRE_TYPE_REDIRECT, packet), REFUSALS},
         {"checksum", wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_REDIRECT, packet, REDIRECT), REFUSALS, true},
@@ -221,14 +218,13 @@ std::vector<bytes> split_writes() {
 }
 
 TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
-    struct row {
+    const struct {
         const char *what;
         std::function<void(bytes *second)> change;
         size_t expected = 2; // writes
         uint8_t protocol = PROTOCOL_TCP;
         bool mended = true; // after the change
-    };
-    const row rows[] = {
+    } rows[] = {
         {"next segment", [](bytes *) {}, 1},
         {"next segment with PSH", [](bytes *p) { tcp_header(p)->flags |= TCP_PSH; }, 1},
         {"shorter", [](bytes *p) { p->resize(p->size() - 50); }, 1},
@@ -263,7 +259,7 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
         {"no UDP checksum", [](bytes *p) { (*p)[26] = (*p)[27] = 0; }, 2, PROTOCOL_UDP, false},
         {"UDP checksum", [](bytes *p) { p->back()++; }, 2, PROTOCOL_UDP, false},
     };
-    for (const row &row : rows) {
+    for (const auto &row : rows) {
         SCOPED_TRACE(row.what);
         std::vector<bytes> packets = {make_packet(row.protocol, 0, 100), make_packet(row.protocol, 1, 100)};
         row.change(&packets[1]);
@@ -277,12 +273,11 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
         EXPECT_EQ(writes.size(), 2u);
     }
     // A first packet with a wrong checksum is not merged, but the others are.
-    std::vector<bytes> three = {make_packet(PROTOCOL_TCP, 0, 100), make_packet(PROTOCOL_TCP, 1, 100),
-                                make_packet(PROTOCOL_TCP, 2, 100)};
-    three[0].back()++;
-    merge_packets(three);
+    bytes first = make_packet(PROTOCOL_TCP, 0, 100);
+    first.back()++;
+    merge_packets({first, make_packet(PROTOCOL_TCP, 1, 100), make_packet(PROTOCOL_TCP, 2, 100)});
     ASSERT_EQ(writes.size(), 2u);
-    EXPECT_EQ(writes[0].packet, three[0]);
+    EXPECT_EQ(writes[0].packet, first);
     EXPECT_EQ(writes[1].packets, 2u);
     merge_packets({make_packet(PROTOCOL_UDP, 0, 100), make_packet(PROTOCOL_UDP, 1, 100)}, false);
     EXPECT_EQ(writes.size(), 2u);
@@ -547,11 +542,10 @@ TEST_F(live_plane, two_that_take_each_other_for_the_owner_exchange_a_packet_once
         ASSERT_EQ(pipe(ready), 0);
         const pid_t other = start_child([&] {
             close_kernel_socket(); // it belongs to the appliance's namespace
-            const bool done = setns(router, CLONE_NEWNET) == 0 && unshare(CLONE_NEWNS) == 0 &&
-                              mount("", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
-                              mount("", "/run", "tmpfs", 0, nullptr) == 0 &&
-                              system("ip link set lo up") == 0 &&
-                              believe_in_other(STRANGER, APPLIANCE, by_mask);
+            const bool done =
+                setns(router, CLONE_NEWNET) == 0 && unshare(CLONE_NEWNS) == 0 &&
+                system("mount --make-rprivate / && mount -t tmpfs tmpfs /run && ip link set lo up") == 0 &&
+                believe_in_other(STRANGER, APPLIANCE, by_mask);
             return done && write(ready[1], "", 1) == 1 ? pause() : 1;
         });
         close(ready[1]);

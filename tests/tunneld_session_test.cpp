@@ -1,7 +1,6 @@
 // tunneld's session with mgmtd and its health checks, with real sockets. mgmtd's server runs on the same
 // loop.
 #include <filesystem>
-#include <fstream>
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>

@@ -81,8 +81,7 @@ int listen_on(int type, uint32_t address, uint16_t port) {
     const int fd = socket(AF_INET, type | SOCK_NONBLOCK | SOCK_CLOEXEC, 0), on = 1;
     setsockopt(fd, IPPROTO_IP, IP_TRANSPARENT, &on, sizeof(on));
     EXPECT_EQ(bind_to(fd, address, port), 0) << strerror(errno);
-    if (type == SOCK_STREAM)
-        listen(fd, 100);
+    listen(fd, 100); // has no effect on datagrams
     return fd;
 }
 
