@@ -111,12 +111,6 @@ std::set<std::string> describe_wanted(const wanted_state &wanted) {
     return lines;
 }
 
-struct wanted_case {
-    const char *name;
-    strings lines;                                                          // "!line": it is missing
-    std::function<void(appliance_view &)> change = [](appliance_view &) {}; // of two_tunnels()
-};
-
 // Group 61 shares its flows with OTHER; group 62 redirects the servers' replies.
 void share_flows(appliance_view *view, bool by_mask) {
     view->groups[62] = view->groups[61];
@@ -132,7 +126,11 @@ void use_l2(appliance_view *view) {
         group.routers[0].forward = group.routers[0].give_back = travel::l2;
 }
 
-const wanted_case wanted_cases[] = {
+const struct {
+    const char *name;
+    strings lines;                                                          // "!line": it is missing
+    std::function<void(appliance_view &)> change = [](appliance_view &) {}; // of two_tunnels()
+} wanted_cases[] = {
     {"a group with its router's tunnel; the other is carried as well",
      {"link wccp0 tunneld 3 10.0.0.101 10.0.0.1", "link wccp1 tunneld 4 10.0.0.101 10.0.0.2",
       "group 61 wccp0", "rule 0 wccp1 57430001 204800", "rule 1 wccp1 57430002 254", "rule 3 wccp1 0 204802",

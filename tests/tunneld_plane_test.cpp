@@ -13,10 +13,8 @@
 #include "peers/tunneld/kernel_state.h"
 #include "peers/tunneld/netlink.h"
 #include "peers/tunneld/passing.h"
-#include "peers/tunneld/plane.h"
 #include "peers/tunneld/user_shortcut.h"
 #include "peers/tunneld/user_tun.h"
-#include "peers/tunneld/wanted_state.h"
 #include "tests/support/packets.h"
 #include "tests/support/test_host.h"
 
@@ -400,23 +398,20 @@ void send_partial() {
 
 // Three packets that may take the shortcut, of 36, 37 and 38 bytes, and some that may not.
 void send_for_shortcut() {
-    const auto made = [](uint8_t protocol, size_t payload) {
-        return make_packet(protocol, 1, payload, AT_LINK);
-    };
-    const bytes plain = made(PROTOCOL_UDP, 8);
+    const bytes plain = make_packet(PROTOCOL_UDP, 1, 8, AT_LINK);
     bytes corrupt = plain, fragment = plain, cut = plain;
     ip_header(&corrupt)->ttl--;
     ip_header(&fragment)->fragment = to_be16(0x2000);
     fix_checksums(&fragment);
     cut.pop_back();
-    for (const bytes &content : {corrupt, fragment, cut, made(PROTOCOL_TCP, 8)})
+    for (const bytes &content : {corrupt, fragment, cut, make_packet(PROTOCOL_TCP, 1, 8, AT_LINK)})
         send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, content, REDIRECT));
     send_gre(ROUTER, wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, plain));
     send_gre(ROUTER, wrap_in_gre(0, 0x86dd, plain));
     send_gre(STRANGER, wrap_in_gre(0, GRE_TYPE_IPV4, plain));
     send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_IPV4, plain));
-    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 9)));
-    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 10), REDIRECT));
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_UDP, 1, 9, AT_LINK)));
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_UDP, 1, 10, AT_LINK), REDIRECT));
 }
 
 // Makes this process the appliance `self`, which takes `other` for the owner of all flows.

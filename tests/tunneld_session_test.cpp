@@ -9,6 +9,7 @@
 #include "peers/tunneld/course.h"
 #include "peers/tunneld/flow_count.h"
 #include "peers/tunneld/health.h"
+#include "peers/tunneld/link_names.h"
 #include "peers/tunneld/session_config.h"
 #include "peers/tunneld/slot_owners.h"
 #include "runtime/ttime.h"
@@ -74,9 +75,7 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
         EXPECT_FALSE(read_configuration(nodes, &complaints).intercepts.contains(51)) << ports;
     }
     for (uint32_t i = 0; i < BYPASSES_MAX + 9; i++)
-        nodes.push_back(make_field(NODE_BYPASS_CONFIG "/10.1." + std::to_string(i / 256) + "." +
-                                       std::to_string(i % 256) + "\\/32",
-                                   ""));
+        nodes.push_back(make_field(NODE_BYPASS_CONFIG "/" + address_text(0x0a010000 + i) + "\\/32", ""));
     EXPECT_EQ(read_configuration(nodes, &complaints).bypasses.size(), BYPASSES_MAX);
     EXPECT_EQ(complaints.size(), COMPLAINTS_MAX);
 }

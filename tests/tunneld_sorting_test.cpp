@@ -195,12 +195,8 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
     static const auto bypass_client = [](W &w) { w.bypasses = {{CLIENT, 32}}; };
     static const auto bypass_all = [](W &w) { w.bypasses = {{0, 0}}; };
     static const auto end_proxy = [](W &w) { w.groups[0].condition.proxy_up = false; };
-    static const auto fail_closed = [](W &w) {
-        w.groups[0].condition.proxy_up = false, w.groups[0].rules.drop_when_down = true;
-    };
-    static const auto deactivate = [](W &w) {
-        w.groups[0].condition.active = false, w.groups[0].rules.drop_when_down = true;
-    };
+    static const auto end_last_proxy = [](W &w) { w.groups[2].condition.proxy_up = false; };
+    static const auto deactivate = [](W &w) { w.groups[0].condition.active = false; };
     static const auto use_free_port = [](W &w) { w.groups[0].rules.to = 3999; };
     static const auto use_loopback = [](W &w) { w.groups[0].rules.to = 3129; };
     static const auto forward_rest = [](W &w) {
@@ -247,8 +243,8 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
         {"a bypassed server", {.destination = BYPASSED}, LINK, "wccp0", SORTED_BYPASSED, 0},
         {"no bypass any more", {.source = BYPASSED}, LINK, "answer", TO_PROXY, 5, bypass_client},
         {"everything is bypassed", {}, LINK, "wccp0", SORTED_BYPASSED, 0, bypass_all},
-        {"proxy down", {}, LINK, "wccp0", SORTED_DOWN, 5, end_proxy},
-        {"fail closed", {}, LINK, "", SORTED_DOWN, 5, fail_closed},
+        {"proxy down", {.port = 8100}, LINK, "wccp0", SORTED_DOWN, 7, end_last_proxy},
+        {"fail closed", {}, LINK, "", SORTED_DOWN, 5, end_proxy},
         {"not active", {}, LINK, "wccp0", SORTED_DOWN, 5, deactivate},
         {"nobody listens", {}, LINK, "wccp0", RETURNED, 5, use_free_port},
         {"a proxy on loopback", {}, LINK, "answer", TO_PROXY, 5, use_loopback},
@@ -272,6 +268,7 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
     for (const auto &row : rows) {
         SCOPED_TRACE(row.what);
         wanted_sorting wanted = make_wanted();
+        wanted.groups[0].rules.drop_when_down = true;
         row.change(wanted);
         apply(wanted);
         sorting_counters before = counters();

@@ -45,8 +45,6 @@ struct Tunneld : testing::Test {
         mailbox = static_cast<wccp_tunnel_mailbox *>(
             cmem_create_block(sizeof(wccp_tunnel_mailbox), WCCP_MAILBOX_NAME));
         ASSERT_TRUE(mailbox);
-        for (wccp_policy_role &role : mailbox->policy_roles)
-            role.role = 2;
     }
     Tunneld() { mailbox->command = 0; }
     command_desk desk;
