@@ -517,7 +517,7 @@ TEST_F(live_plane, only_valid_udp_of_a_link_takes_the_shortcut) {
     shortcut_add_link(&shortcut, APPLIANCE, ROUTER, tun.index);
     for (const bool known : {true, false}) {
         act_as_router(send_for_shortcut);
-        for (const size_t length : {8, 9, 10})
+        for (const size_t length : {8u, 9u, 10u})
             EXPECT_EQ(receive_packet(datagrams, known ? 3000 : 100).size(), known ? length : 0);
         const shortcut_link taken = shortcut_count(shortcut, APPLIANCE, ROUTER);
         EXPECT_EQ(taken.packets, known ? 3u : 0u);
