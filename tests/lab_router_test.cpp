@@ -16,41 +16,29 @@ constexpr address ROUTER = 0x0a000001; // 10.0.0.1
 constexpr address LOW = 0x0a000065;    // 10.0.0.101
 constexpr address HIGH = 0x0a000066;   // 10.0.0.102
 
-bytes bytes_of_hex(const std::string &digits) {
-    return hex(digits).bytes;
-}
 std::string hex_word(uint32_t value) {
     char text[9];
     snprintf(text, sizeof text, "%08x", value);
     return text;
 }
-std::string hex_zeros(size_t count) {
-    return std::string(2 * count, '0');
-}
-bytes make_message(uint32_t type, const std::string &components) {
-    return wire_message(type, {hex(components)});
-}
 // No security; dynamic service 51, priority 5, protocol 6 (TCP), hash on the destination address.
 const std::string PLAIN = "0000 0004 00000000";
-const std::string SERVICE_51 = "0001 0018 01 33 05 06 00000002 00000000000000000000000000000000";
+const std::string SERVICE_51 = " 0001 0018 01 33 05 06 00000002 00*16 ";
 
 // Receive id 0: the router is not in the view of the message.
 bytes make_here_i_am(address id, uint16_t weight, uint32_t receive_id, const std::string &security = PLAIN) {
     const std::string identity =
-        "0003 002c" + hex_word(id) + "0000 0000" + hex_zeros(32) + hex_word(weight).substr(4) + "0000";
+        "0003 002c" + hex_word(id) + " 0000 0000 00*32 " + hex_word(weight).substr(4) + "0000";
     const std::string view = receive_id == 0
                                  ? "0005 000c 00000001 00000000 00000000"
                                  : "0005 0014 00000001 00000001 0a000001" + hex_word(receive_id) + "00000000";
-    return make_message(10, security + SERVICE_51 + identity + view);
+    return wire_message(10, {hex(security + SERVICE_51 + identity + view)});
 }
 // Two appliances: 100 buckets for the first, 156 for the second.
 bytes hash_assignment(address key, uint32_t receive_id, uint32_t change_number) {
-    std::string buckets;
-    for (int i = 0; i < 256; i++)
-        buckets += i < 100 ? "00" : "01";
-    return make_message(12, PLAIN + SERVICE_51 + "0006 0124" + hex_word(key) + "00000001 00000001 0a000001" +
-                                hex_word(receive_id) + hex_word(change_number) +
-                                "00000002 0a000065 0a000066" + buckets);
+    return wire_message(12, {hex(PLAIN + SERVICE_51 + "0006 0124" + hex_word(key) +
+                                 "00000001 00000001 0a000001" + hex_word(receive_id) +
+                                 hex_word(change_number) + "00000002 0a000065 0a000066 00*100 01*156")});
 }
 
 struct bench {
@@ -58,11 +46,10 @@ struct bench {
     output out;
 
     bench() { self.options.self = ROUTER; }
-    const bytes &send(address from, const bytes &data) {
+    bytes send(address from, const bytes &data) {
         out = {};
         router_receive(&self, 0, from, ROUTER, data, &out);
-        static const bytes none;
-        return out.send.empty() ? none : out.send.back().data;
+        return out.send.empty() ? bytes() : out.send.back().data;
     }
     std::string result_of(address from, const bytes &data) {
         send(from, data);
@@ -94,10 +81,10 @@ TEST(LabRouter, EchoesTheHashAssignmentItAdopted) {
     EXPECT_EQ(assign(LOW, LOW, lab.newest(LOW), change), "adopted again");
     const bytes answer = lab.send(LOW, make_here_i_am(LOW, 100, lab.newest(LOW)));
     // The view follows header, security, service and an identity with two addresses.
-    const bytes wanted = bytes_of_hex(
-        "0004 0070" + hex_word(change) + "0a000065 00000001 00000001 0a000001 00000002" +
-        "0a000065 0000 0000 ffffffffffffffffffffffff 0f" + hex_zeros(19) + "0064 0000" +
-        "0a000066 0000 0000" + hex_zeros(12) + "f0 ffffffffffffffffffffffffffffffffffffff 00c8 0000");
+    const bytes wanted =
+        hex("0004 0070" + hex_word(change) + "0a000065 00000001 00000001 0a000001 00000002" +
+            "0a000065 0000 0000 ff*12 0f 00*19 0064 0000 0a000066 0000 0000 00*12 f0 ff*19 00c8 0000")
+            .bytes;
     ASSERT_GE(answer.size(), 72 + wanted.size());
     EXPECT_EQ(bytes(answer.begin() + 72, answer.begin() + 72 + 0x74), wanted);
 }
@@ -125,10 +112,10 @@ TEST(LabRouter, RefusesMalformedMessages) {
 TEST(LabRouter, SignsAndChecks) {
     bench lab;
     lab.self.options.password = "secret";
-    bytes signed_hello = make_here_i_am(LOW, 100, 0, "0000 0014 00000001" + hex_zeros(16));
+    bytes signed_hello = make_here_i_am(LOW, 100, 0, "0000 0014 00000001 00*16");
     EXPECT_EQ(lab.result_of(LOW, signed_hello), "refused: wrong digest");
     // Computed with md5sum: "secret\0\0" and the message with a digest of zeros.
-    const bytes digest = bytes_of_hex("bc76b5520d4b344b2f9ce814b8dbb9f3");
+    const bytes digest = hex("bc76b5520d4b344b2f9ce814b8dbb9f3").bytes;
     std::copy(digest.begin(), digest.end(), signed_hello.begin() + 16);
     const bytes answer = lab.send(LOW, signed_hello);
     ASSERT_FALSE(answer.empty());
@@ -144,7 +131,7 @@ TEST(LabRouter, SignsAndChecks) {
 
 // IPv4 with the first bytes of TCP.
 bytes client_packet(const std::string &src, const std::string &dst, const std::string &ports) {
-    return bytes_of_hex("4500 002c 0001 4000 40 06 0000" + src + dst + ports + hex_zeros(20));
+    return hex("4500 002c 0001 4000 40 06 0000" + src + dst + ports + "00*20").bytes;
 }
 
 TEST(LabRouter, FindsTheOwnerOfAPacket) {
@@ -182,14 +169,14 @@ TEST(LabRouter, FindsTheOwnerOfAPacket) {
 
     const verdict found = ask(web);
     EXPECT_EQ(gre_header(lab.self, found),
-              bytes_of_hex("0000 883e 80 33 00" + hex_word(found.bucket).substr(6)));
+              hex("0000 883e 80 33 00" + hex_word(found.bucket).substr(6)).bytes);
     // scenario_traffic has the router's other headers.
     for (const auto &[gre, offset] : {std::pair{"0000 0800 45000014", 4u},
                                       {"0000 883e 45000014", 4u},
                                       {"0000 883e 80330007 45000014", 8u},
                                       {"2000 0800 45000014", 0u},
                                       {"0000 86dd 60000014", 0u}})
-        EXPECT_EQ(inner_offset(bytes_of_hex(gre).data(), bytes_of_hex(gre).size()), offset) << gre;
+        EXPECT_EQ(inner_offset(hex(gre).bytes.data(), hex(gre).size()), offset) << gre;
 
     lab.in().current.buckets.fill(0);
     EXPECT_EQ(ask(web).owner, 0u);

@@ -4,11 +4,9 @@
 
 #include <gtest/gtest.h>
 #include <linux/rtnetlink.h>
-#include <sys/mount.h>
 
 #include <algorithm>
 #include <filesystem>
-#include <fstream>
 #include <set>
 
 #include "peers/tunneld/kernel_links.h"
@@ -16,7 +14,9 @@
 #include "peers/tunneld/kernel_state.h"
 #include "peers/tunneld/link_names.h"
 #include "peers/tunneld/sorting_rules.h"
+#include "peers/tunneld/user_tun.h"
 #include "tests/support/test_host.h"
+#include "tests/support/texts.h"
 
 // Replaces the rules that sort packets. It checks that the tables to which they send packets exist before the
 // rules are added, and until they are removed.
@@ -24,16 +24,17 @@ static wanted_sorting sorted;
 static bool needs_are_met(const wanted_sorting &sorting) {
     std::vector<found_rule> rules;
     std::vector<found_route> routes;
+    std::set<uint32_t> routed;
+    std::set<std::pair<std::string, uint32_t>> looked_up;
     if (find_rules(&rules) || find_routes(&routes))
         return false;
+    for (const found_route &one : routes)
+        routed.insert(one.route.table);
+    for (const found_rule &one : rules)
+        looked_up.insert({one.rule.in_interface, one.rule.table});
     return std::all_of(sorting.links.begin(), sorting.links.end(), [&](const std::string &name) {
         const uint32_t table = TABLE_LINK_FIRST + *link_number(name);
-        return if_nametoindex(name.c_str()) &&
-               std::any_of(routes.begin(), routes.end(),
-                           [&](const found_route &one) { return one.route.table == table; }) &&
-               std::any_of(rules.begin(), rules.end(), [&](const found_rule &one) {
-                   return one.rule.table == table && one.rule.in_interface == name;
-               });
+        return if_nametoindex(name.c_str()) && routed.contains(table) && looked_up.contains({name, table});
     });
 }
 [[gnu::weak]] bool apply_sorting_rules(const wanted_sorting &wanted, std::string *out_error) {
@@ -47,8 +48,6 @@ static bool needs_are_met(const wanted_sorting &sorting) {
 }
 
 namespace {
-
-using strings = std::vector<std::string>;
 
 // --- The wanted state
 
@@ -73,7 +72,7 @@ std::string describe_rule(const wanted_rule &rule) {
     return text;
 }
 
-std::set<std::string> describe_wanted(const wanted_state &wanted) {
+std::set<std::string> links_and_tables(const wanted_state &wanted) {
     std::set<std::string> lines;
     for (const auto &link : wanted.links)
         lines.insert("link " + link.name + " " + link_alias(link.wish));
@@ -81,11 +80,18 @@ std::set<std::string> describe_wanted(const wanted_state &wanted) {
         lines.insert(describe_rule(rule));
     for (const auto &route : wanted.routes)
         lines.insert(describe_route(route));
+    return lines;
+}
+std::set<std::string> describe_wanted(const wanted_state &wanted) {
+    std::set<std::string> lines = links_and_tables(wanted);
     for (const auto &setting : wanted.settings)
         lines.insert("setting " + setting.path + " " + setting.value + (setting.restore ? " restored" : ""));
     const wanted_sorting &sorting = wanted.sorting;
-    for (const auto &name : sorting.l2_interfaces)
-        lines.insert("l2 " + name);
+    for (const auto &[word, names] : {std::pair{"l2 ", &sorting.l2_interfaces},
+                                      {"member ", &sorting.members},
+                                      {"passing ", &sorting.passing}})
+        for (const auto &name : *names)
+            lines.insert(word + name);
     for (const auto &[name, mark] : sorting.l2_into_gre)
         lines.insert("l2 " + name + " into " + std::to_string(mark - MARK_RETURN));
     for (const auto &ends : sorting.ends)
@@ -98,22 +104,12 @@ std::set<std::string> describe_wanted(const wanted_state &wanted) {
             line += mark ? " " + std::to_string(mark - MARK_PASS) : " -";
         lines.insert(line + (group.rules.to ? "" : " unwanted"));
     }
-    for (const auto &name : sorting.members)
-        lines.insert("member " + name);
-    for (const auto &name : sorting.passing)
-        lines.insert("passing " + name);
     for (const auto &[id, group] : wanted.passing)
         lines.insert("bucket 9 of " + std::to_string(id) + " to " + address_text(group.members[9]) +
                      (group.by_source_port ? " by source" : ""));
     lines.insert("mss " + std::to_string(sorting.mss) + (sorting.drop_outer_gre ? " outer dropped" : ""));
     return lines;
 }
-
-struct wanted_case {
-    const char *name;
-    strings lines;                                                          // "!line": it is missing
-    std::function<void(appliance_view &)> change = [](appliance_view &) {}; // of two_tunnels()
-};
 
 // Group 61 shares its flows with OTHER; group 62 redirects the servers' replies.
 void share_flows(appliance_view *view, bool by_mask) {
@@ -130,7 +126,11 @@ void use_l2(appliance_view *view) {
         group.routers[0].forward = group.routers[0].give_back = travel::l2;
 }
 
-const wanted_case wanted_cases[] = {
+const struct {
+    const char *name;
+    strings lines;                                                          // "!line": it is missing
+    std::function<void(appliance_view &)> change = [](appliance_view &) {}; // of two_tunnels()
+} wanted_cases[] = {
     {"a group with its router's tunnel; the other is carried as well",
      {"link wccp0 tunneld 3 10.0.0.101 10.0.0.1", "link wccp1 tunneld 4 10.0.0.101 10.0.0.2",
       "group 61 wccp0", "rule 0 wccp1 57430001 204800", "rule 1 wccp1 57430002 254", "rule 3 wccp1 0 204802",
@@ -268,57 +268,32 @@ TEST(link_names, only_ours_are_read) {
 
 // --- The kernel
 
-std::map<std::string, int> tuns;
-
 bool make_tun(const std::string &name, const link_wish &, uint32_t *out_index, std::string *) {
-    if (!tuns.count(name)) {
-        EXPECT_GE(tuns[name] = open_tun(name), 0);
+    static std::map<std::string, uint32_t> held; // indices of the interfaces that this process has opened
+    if (!held[name] || held[name] != if_nametoindex(name.c_str())) {
+        EXPECT_GE(open_tun(name), 0);
     }
-    *out_index = if_nametoindex(name.c_str());
+    *out_index = held[name] = if_nametoindex(name.c_str());
     return true;
 }
-bool drop_tun(const std::string &name, std::string *) {
-    if (const auto found = tuns.extract(name)) {
-        ioctl(found.mapped(), TUNSETPERSIST, 0);
-        close(found.mapped());
-    }
-    return true;
-}
-const data_plane tun_plane = {"tun", nullptr, nullptr, nullptr, make_tun, drop_tun, nullptr};
+const data_plane tun_plane = {"tun", nullptr, nullptr, nullptr, make_tun, remove_interface, nullptr};
 
-// Runs a program that does not clean up.
-void run_program(const std::function<void()> &steps) {
-    EXPECT_EQ(wait_for_child(start_child([&] {
-                  steps();
-                  return testing::Test::HasFailure() ? 1 : 0;
-              })),
-              0)
-        << "see above";
-}
-
-std::string setting_file(const std::string &path) {
-    return "/proc/sys/net/ipv4/conf/" + path;
-}
+const std::string SETTINGS = "/proc/sys/net/ipv4/conf/";
 void put_setting(const std::string &path, const std::string &value) {
-    std::ofstream(setting_file(path)) << value;
+    std::ofstream(SETTINGS + path) << value;
 }
 // The values of several settings, each of which is one character.
 std::string read_settings(const strings &paths) {
-    std::string values, value;
-    for (const auto &path : paths) {
-        std::ifstream(setting_file(path)) >> value;
-        values += value;
-    }
+    std::string values;
+    for (const auto &path : paths)
+        values += text_of_file(SETTINGS + path)[0];
     return values;
 }
 
-// The kernel's route for a packet.
-std::string route_of(const std::string &arguments) {
-    FILE *ip = popen(("ip route get 198.51.100.1 from 203.0.113.1 " + arguments + " 2>&1").c_str(), "r");
-    char text[200] = "";
-    EXPECT_TRUE(fgets(text, sizeof text, ip)) << arguments;
-    pclose(ip);
-    return text;
+// Whether the kernel's route for a packet contains the text.
+bool is_routed(const std::string &arguments, const std::string &text) {
+    const std::string find_route = "ip route get 198.51.100.1 from 203.0.113.1 " + arguments;
+    return system((find_route + " 2>&1 | grep -q '" + text + "'").c_str()) == 0;
 }
 
 // Counts the kernel's notifications about links, addresses, routes, rules and settings during the steps.
@@ -345,7 +320,7 @@ std::string reconcile_kernel(const wanted_state &wanted, const data_plane &plane
     return error;
 }
 
-// Everything in the kernel that tunneld has made, as describe() prints it.
+// Everything in the kernel that tunneld has made, as links_and_tables() describes it.
 std::set<std::string> find_ours() {
     std::set<std::string> lines;
     std::vector<found_link> links;
@@ -363,13 +338,6 @@ std::set<std::string> find_ours() {
         lines.insert(describe_route(one.route) + (one.odd ? " odd" : ""));
     return lines;
 }
-std::set<std::string> links_and_tables(const wanted_state &wanted) {
-    std::set<std::string> lines;
-    for (const auto &line : describe_wanted(wanted))
-        if (line.starts_with("link ") || line.starts_with("rule ") || line.starts_with("route "))
-            lines.insert(line);
-    return lines;
-}
 void reconcile_all(const wanted_state &wanted, const data_plane &plane = tun_plane) {
     EXPECT_EQ(reconcile_kernel(wanted, plane), "");
     EXPECT_EQ(find_ours(), links_and_tables(wanted));
@@ -381,25 +349,21 @@ void remove_all(const data_plane &plane = tun_plane) {
 }
 
 // Provides an interface "eth0" that is not tunneld's.
-class kernel_state : public ::testing::Test {
-protected:
+struct kernel_state : testing::Test {
+    const int lan = open_tun("eth0");
     void SetUp() override {
-        ASSERT_EQ(geteuid(), 0u) << "run by lab/in-appliance";
-        lan = open_tun("eth0");
-        ASSERT_GE(lan, 0);
+        ASSERT_GE(lan, 0) << "run by lab/in-appliance";
         ASSERT_EQ(system("ip address add 10.0.0.101/24 dev eth0 && ip link set eth0 up && "
-                         "ip route add default via 10.0.0.254"),
+                         "ip route add default via 10.0.0.254 && cd /proc/sys/net/ipv4/conf && "
+                         "for key in rp_filter send_redirects; do "
+                         "echo 1 >all/$key && echo 0 >default/$key && echo 0 >eth0/$key || exit; done"),
                   0);
-        for (const char *key : {"rp_filter", "send_redirects"})
-            for (const char *interface : {"all", "default", "eth0"})
-                put_setting(std::string(interface) + "/" + key, strcmp(interface, "all") == 0 ? "1" : "0");
     }
     void TearDown() override {
         run_program([] { remove_all(); });
         ioctl(lan, TUNSETPERSIST, 0);
         close(lan);
     }
-    int lan = -1;
 };
 
 TEST_F(kernel_state, made_once_followed_and_removed) {
@@ -412,9 +376,9 @@ TEST_F(kernel_state, made_once_followed_and_removed) {
         for (const auto &setting : wanted.settings)
             EXPECT_EQ(read_settings({setting.path}), setting.value) << setting.path;
 
-        EXPECT_NE(route_of("iif wccp0").find("table 204801"), std::string::npos) << route_of("iif wccp0");
-        EXPECT_EQ(route_of("iif wccp0 mark 0x57430001").find("local "), 0u);
-        EXPECT_NE(route_of("iif wccp0 mark 0x57430002").find("dev eth0"), std::string::npos);
+        EXPECT_TRUE(is_routed("iif wccp0", "table 204801"));
+        EXPECT_TRUE(is_routed("iif wccp0 mark 0x57430001", "^local "));
+        EXPECT_TRUE(is_routed("iif wccp0 mark 0x57430002", "dev eth0"));
 
         EXPECT_EQ(count_changes([&] { EXPECT_EQ(reconcile_kernel(wanted), ""); }), 0);
 
@@ -450,12 +414,10 @@ TEST_F(kernel_state, what_a_killed_program_leaves_is_taken_over) {
     run_program([&] { EXPECT_EQ(reconcile_kernel(make_wanted_state(view, {}, true)), ""); });
     // A link whose program has died does not lose packets: they are routed like others once the kernel has
     // noticed.
-    std::string route;
-    for (int i = 0; i < 150 && route.find("dev eth0") == std::string::npos; i++) {
+    const auto is_noticed = [] { return is_routed("iif eth0 mark 0x57430100", "dev eth0"); };
+    for (int i = 0; i < 150 && !is_noticed(); i++)
         usleep(20000);
-        route = route_of("iif eth0 mark 0x57430100");
-    }
-    EXPECT_NE(route.find("dev eth0"), std::string::npos) << route;
+    EXPECT_TRUE(is_noticed());
     // A link without a mark, one with an invalid alias, one that is not tunneld's, and rules and routes that
     // are not wanted.
     for (const char *name : {"wccp5", "wccp7", "tun3"})
@@ -523,11 +485,10 @@ TEST_F(kernel_state, failures_are_reported_and_the_rest_is_done) {
         view.groups[61].interface = "eth7"; // does not exist
         view.groups[61].force_l2_return = true;
         const auto wanted = make_wanted_state(view, {}, true);
-        ASSERT_EQ(mount("/proc/sys", "/proc/sys", nullptr, MS_BIND, nullptr), 0);
-        ASSERT_EQ(mount(nullptr, "/proc/sys", nullptr, MS_BIND | MS_REMOUNT | MS_RDONLY, nullptr), 0);
+        ASSERT_EQ(system("mount --bind /proc/sys /proc/sys && mount -o remount,ro,bind /proc/sys"), 0);
         EXPECT_EQ(reconcile_kernel(wanted),
                   "cannot set /proc/sys/net/ipv4/conf/default/rp_filter to 1: Read-only file system");
-        EXPECT_EQ(umount("/proc/sys"), 0);
+        EXPECT_EQ(system("umount /proc/sys"), 0);
         auto expected = links_and_tables(wanted);
         EXPECT_EQ(expected.erase("route 204801 eth7 via 10.0.0.17"), 1u);
         EXPECT_EQ(find_ours(), expected);

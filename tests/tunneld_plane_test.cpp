@@ -6,9 +6,6 @@
 #include <netpacket/packet.h>
 #include <poll.h>
 #include <sched.h>
-#include <signal.h>
-#include <sys/mount.h>
-#include <sys/prctl.h>
 
 #include <ctime>
 
@@ -16,10 +13,8 @@
 #include "peers/tunneld/kernel_state.h"
 #include "peers/tunneld/netlink.h"
 #include "peers/tunneld/passing.h"
-#include "peers/tunneld/plane.h"
 #include "peers/tunneld/user_shortcut.h"
 #include "peers/tunneld/user_tun.h"
-#include "peers/tunneld/wanted_state.h"
 #include "tests/support/packets.h"
 #include "tests/support/test_host.h"
 
@@ -35,16 +30,15 @@ ip4_wire_header *ip_header(bytes *packet) {
 tcp_wire_header *tcp_header(bytes *packet) {
     return header_at<tcp_wire_header>(packet, sizeof(ip4_wire_header));
 }
-
 void fix_checksums(bytes *packet) {
     mend_packet(packet->data(), packet->size());
 }
 
 // A packet's id, content and, with the payload's size, sequence number follow from its number.
-bytes make_packet(uint8_t protocol, uint32_t number, size_t payload) {
+bytes make_packet(uint8_t protocol, uint32_t number, size_t payload, uint32_t destination = 0xcb007101) {
     const size_t transport = protocol == PROTOCOL_TCP ? 32 : sizeof(udp_wire_header);
     bytes packet =
-        make_ip_packet(protocol, 0xc6336401, 0xcb007101, bytes(transport + payload), IP4_DONT_FRAGMENT);
+        make_ip_packet(protocol, 0xc6336401, destination, bytes(transport + payload), IP4_DONT_FRAGMENT);
     ip_header(&packet)->id = to_be16(static_cast<uint16_t>(0xfffe + number));
     ip_header(&packet)->ttl = 60;
     tcp_wire_header *header = tcp_header(&packet);
@@ -61,6 +55,8 @@ bytes make_packet(uint8_t protocol, uint32_t number, size_t payload) {
     fix_checksums(&packet);
     return packet;
 }
+
+const bytes REDIRECT = {0x80, 51, 7, 200}; // flags, service, alternative and primary bucket
 
 bytes wrap_in_gre(uint16_t flags, uint16_t type, const bytes &content, const bytes &between = {}) {
     bytes out(sizeof(gre_wire_header));
@@ -91,12 +87,10 @@ TEST(ip_packet, checksums_are_sums_of_words) {
 }
 
 TEST(gre, headers_are_taken_or_refused) {
-    const bytes packet = make_packet(PROTOCOL_UDP, 1, 31), redirect = {0x80, 51, 7, 200};
-    bytes wrong = packet, cut = packet, padded = packet,
-          corrupt = wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
+    const bytes packet = make_packet(PROTOCOL_UDP, 1, 31);
+    bytes wrong = packet, cut = packet, corrupt = wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
     wrong[8]++; // TTL, under the header's checksum
     cut.pop_back();
-    padded.resize(packet.size() + 6);
     corrupt.back()++;
     bytes stale = wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, packet);
     stale[4]++;
@@ -107,10 +101,10 @@ TEST(gre, headers_are_taken_or_refused) {
         bool has_redirect = false, merged = false;
     } rows[] = {
         {"plain", wrap_in_gre(0, GRE_TYPE_IPV4, packet), REFUSALS},
-        {"padded", wrap_in_gre(0, GRE_TYPE_IPV4, padded), REFUSALS},
-        {"redirected", wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
+        {"padded", wrap_in_gre(0, GRE_TYPE_IPV4, bytes(6), packet), REFUSALS},
+        {"redirected", wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, REDIRECT), REFUSALS, true},
         {"redirected without header", wrap_in_gre(0, GRE_TYPE_REDIRECT, packet), REFUSALS},
-        {"checksum", wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_REDIRECT, packet, redirect), REFUSALS, true},
+        {"checksum", wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_REDIRECT, packet, REDIRECT), REFUSALS, true},
         {"reserved bits", wrap_in_gre(0x03f8, GRE_TYPE_IPV4, packet), REFUSALS},
         {"wrong checksum", corrupt, REFUSED_CHECKSUM},
         {"checksum of the first of several", stale, REFUSALS, false, true},
@@ -122,8 +116,8 @@ TEST(gre, headers_are_taken_or_refused) {
         {"IPv6", wrap_in_gre(0, 0x86dd, packet), REFUSED_PROTOCOL},
         {"header cut", {0, 0, 8}, REFUSED_LENGTH},
         {"redirect header cut", wrap_in_gre(0, GRE_TYPE_REDIRECT, {}, {0x80, 51, 7}), REFUSED_LENGTH},
-        {"nothing inside", wrap_in_gre(0, GRE_TYPE_REDIRECT, {}, redirect), REFUSED_LENGTH},
-        {"redirect header under IPv4", wrap_in_gre(0, GRE_TYPE_IPV4, packet, redirect), REFUSED_INNER},
+        {"nothing inside", wrap_in_gre(0, GRE_TYPE_REDIRECT, {}, REDIRECT), REFUSED_LENGTH},
+        {"redirect header under IPv4", wrap_in_gre(0, GRE_TYPE_IPV4, packet, REDIRECT), REFUSED_INNER},
         {"inner checksum", wrap_in_gre(0, GRE_TYPE_IPV4, wrong), REFUSED_INNER},
         {"inner length", wrap_in_gre(0, GRE_TYPE_IPV4, cut), REFUSED_INNER},
     };
@@ -136,12 +130,13 @@ TEST(gre, headers_are_taken_or_refused) {
             continue;
         EXPECT_EQ(bytes(content.packet, content.packet + content.length), packet);
         EXPECT_EQ(content.has_redirect, row.has_redirect);
-        EXPECT_TRUE(!row.has_redirect || memcmp(&content.redirect, redirect.data(), redirect.size()) == 0);
+        EXPECT_TRUE(!row.has_redirect || memcmp(&content.redirect, REDIRECT.data(), REDIRECT.size()) == 0);
     }
 }
 
 TEST(gre, buckets_choose_who_gets_a_packet) {
     constexpr uint32_t MEMBER = 0x0a000066, HERE = 0x0a000065;
+    constexpr size_t WHOLE = 20 + 32 + 31;
     passing_table table;
     table[51] = {HERE, false, {{79, 80}, {443, 443}}, std::vector<uint32_t>(256, 0)};
     table[51].members[200] = MEMBER;
@@ -152,37 +147,30 @@ TEST(gre, buckets_choose_who_gets_a_packet) {
     fill_passing_lookup(table, &lookup);
     const struct {
         const char *what;
-        bytes redirect; // flags, service, alternative and primary bucket
+        bytes redirect;
         uint32_t member;
-        std::function<void(bytes *packet)> change = [](bytes *) {};
+        size_t at = WHOLE; // of other bytes, or if there are none, where the packet ends
+        bytes other = {};
     } rows[] = {
-        {"its bucket", {0x80, 51, 7, 200}, MEMBER},
+        {"its bucket", REDIRECT, MEMBER},
         {"the alternative bucket", {0xc0, 51, 200, 7}, MEMBER},
         {"the other of the two", {0xc0, 51, 7, 200}, 0},
         {"nobody's bucket", {0x80, 51, 200, 7}, 0},
         {"another service", {0x80, 50, 200, 200}, 0},
-        {"another port",
-         {0x80, 51, 7, 200},
-         0,
-         [](bytes *p) { tcp_header(p)->destination_port = to_be16(81); }},
-        {"from any port",
-         {0x80, 52, 7, 200},
-         MEMBER,
-         [](bytes *p) { tcp_header(p)->source_port = to_be16(0); }},
-        {"a new flow", {0x80, 51, 7, 200}, 0, [](bytes *p) { tcp_header(p)->flags = TCP_SYN; }},
-        {"its answer",
-         {0x80, 51, 7, 200},
-         MEMBER,
-         [](bytes *p) { tcp_header(p)->flags = TCP_SYN | TCP_ACK; }},
-        {"a fragment", {0x80, 51, 7, 200}, 0, [](bytes *p) { ip_header(p)->fragment = to_be16(0x2000); }},
-        {"a datagram", {0x80, 51, 7, 200}, 0, [](bytes *p) { ip_header(p)->protocol = PROTOCOL_UDP; }},
-        {"cut within its header", {0x80, 51, 7, 200}, 0, [](bytes *p) { p->resize(39); }},
+        {"another port", REDIRECT, 0, 23, {81}},
+        {"from any port", {0x80, 52, 7, 200}, MEMBER, 20, {0, 0}},
+        {"a new flow", REDIRECT, 0, 33, {TCP_SYN}},
+        {"its answer", REDIRECT, MEMBER, 33, {TCP_SYN | TCP_ACK}},
+        {"a fragment", REDIRECT, 0, 6, {0x20}},
+        {"a datagram", REDIRECT, 0, 9, {PROTOCOL_UDP}},
+        {"cut within its header", REDIRECT, 0, 39},
         {"no redirect header", {}, 0},
     };
     for (const auto &row : rows) {
         SCOPED_TRACE(row.what);
         bytes packet = make_packet(PROTOCOL_TCP, 1, 31);
-        row.change(&packet);
+        packet.resize(row.other.empty() ? row.at : WHOLE);
+        std::copy(row.other.begin(), row.other.end(), packet.begin() + static_cast<std::ptrdiff_t>(row.at));
         fix_checksums(&packet);
         bytes payload = wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, row.redirect);
         gre_content content;
@@ -228,15 +216,13 @@ std::vector<bytes> split_writes() {
 }
 
 TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
-    struct row {
+    const struct {
         const char *what;
         std::function<void(bytes *second)> change;
         size_t expected = 2; // writes
         uint8_t protocol = PROTOCOL_TCP;
         bool mended = true; // after the change
-    };
-    const auto reset_dont_fragment = [](bytes *p) { ip_header(p)->fragment = to_be16(0); };
-    const row rows[] = {
+    } rows[] = {
         {"next segment", [](bytes *) {}, 1},
         {"next segment with PSH", [](bytes *p) { tcp_header(p)->flags |= TCP_PSH; }, 1},
         {"shorter", [](bytes *p) { p->resize(p->size() - 50); }, 1},
@@ -253,7 +239,7 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
         {"id", [](bytes *p) { ip_header(p)->id.bytes[1]++; }},
         {"TTL", [](bytes *p) { ip_header(p)->ttl--; }},
         {"TOS", [](bytes *p) { ip_header(p)->tos = 3; }},
-        {"DF", reset_dont_fragment},
+        {"DF", [](bytes *p) { ip_header(p)->fragment = to_be16(0); }},
         {"fragment", [](bytes *p) { ip_header(p)->fragment = to_be16(0x2000); }},
         {"TCP options", [](bytes *p) { (*p)[51]++; }},
         {"length of TCP options", [](bytes *p) { tcp_header(p)->data_offset = 0x70; }},
@@ -271,7 +257,7 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
         {"no UDP checksum", [](bytes *p) { (*p)[26] = (*p)[27] = 0; }, 2, PROTOCOL_UDP, false},
         {"UDP checksum", [](bytes *p) { p->back()++; }, 2, PROTOCOL_UDP, false},
     };
-    for (const row &row : rows) {
+    for (const auto &row : rows) {
         SCOPED_TRACE(row.what);
         std::vector<bytes> packets = {make_packet(row.protocol, 0, 100), make_packet(row.protocol, 1, 100)};
         row.change(&packets[1]);
@@ -285,12 +271,11 @@ TEST(coalesce, merges_what_receive_offload_would_and_nothing_else) {
         EXPECT_EQ(writes.size(), 2u);
     }
     // A first packet with a wrong checksum is not merged, but the others are.
-    std::vector<bytes> three = {make_packet(PROTOCOL_TCP, 0, 100), make_packet(PROTOCOL_TCP, 1, 100),
-                                make_packet(PROTOCOL_TCP, 2, 100)};
-    three[0].back()++;
-    merge_packets(three);
+    bytes first = make_packet(PROTOCOL_TCP, 0, 100);
+    first.back()++;
+    merge_packets({first, make_packet(PROTOCOL_TCP, 1, 100), make_packet(PROTOCOL_TCP, 2, 100)});
     ASSERT_EQ(writes.size(), 2u);
-    EXPECT_EQ(writes[0].packet, three[0]);
+    EXPECT_EQ(writes[0].packet, first);
     EXPECT_EQ(writes[1].packets, 2u);
     merge_packets({make_packet(PROTOCOL_UDP, 0, 100), make_packet(PROTOCOL_UDP, 1, 100)}, false);
     EXPECT_EQ(writes.size(), 2u);
@@ -346,9 +331,10 @@ TEST(coalesce, splitting_gives_back_what_was_merged) {
     }
 }
 
-// --- Live: this process is the appliance, and a child in another network namespace is the router
+// --- Live: this process is the appliance, and the router is in another network namespace
 
 constexpr uint32_t APPLIANCE = 0x0a000001, ROUTER = 0x0a000002, STRANGER = 0x0a000003;
+constexpr uint32_t AT_LINK = 0xc0a80901; // the link's address here
 constexpr size_t LARGE_DATAGRAM = 30000, PARTIAL_DATAGRAM = 501;
 
 void run_shell(const std::string &command) {
@@ -365,38 +351,35 @@ void send_gre(uint32_t source, const bytes &payload) {
     close(fd);
 }
 
-// Sends packets of each kind as the router, and checks the one that is returned. 0: it was right.
-int send_by_hand() {
+// The next packet from a socket, or bytes from a pipe; empty: there are none.
+bytes receive_packet(int fd, int ms = 3000) {
+    pollfd comes = {fd, POLLIN, 0};
+    bytes got(LARGE_DATAGRAM + 1);
+    const ssize_t length = poll(&comes, 1, ms) == 1 ? read(fd, got.data(), got.size()) : 0;
+    got.resize(static_cast<size_t>(std::max<ssize_t>(length, 0)));
+    return got;
+}
+
+// Sends packets of each kind as the router, and checks the one that is returned.
+void send_by_hand() {
     const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
-    const bytes packet = make_packet(PROTOCOL_UDP, 1, 1472), redirect = {0x80, 51, 7, 200};
+    bytes packet = make_packet(PROTOCOL_UDP, 1, 1472);
+    const bytes large = make_packet(PROTOCOL_UDP, 2, LARGE_DATAGRAM, AT_LINK); // than a frame of the ring
     send_gre(STRANGER, wrap_in_gre(0, GRE_TYPE_IPV4, packet));
     send_gre(ROUTER, wrap_in_gre(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}));
-    bytes large = make_packet(PROTOCOL_UDP, 2, LARGE_DATAGRAM); // larger than a frame of the ring
-    ip_header(&large)->destination = to_be32(0xc0a80901);
-    fix_checksums(&large);
     send_gre(ROUTER, wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, large));
-    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, redirect));
-    pollfd waits = {back, POLLIN, 0};
-    uint8_t got[2048];
-    if (poll(&waits, 1, 3000) != 1)
-        return 1;
-    const ssize_t length = recv(back, got, sizeof got, 0);
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, REDIRECT));
+    const bytes got = receive_packet(back);
     close(back);
-    bytes expected = packet;
-    ip_header(&expected)->ttl--;
-    fix_checksums(&expected);
-    expected = wrap_in_gre(0, GRE_TYPE_REDIRECT, expected, redirect);
-    return length == static_cast<ssize_t>(20 + expected.size()) &&
-                   memcmp(got + 20, expected.data(), expected.size()) == 0
-               ? 0
-               : 2;
+    ip_header(&packet)->ttl--;
+    fix_checksums(&packet);
+    ASSERT_GE(got.size(), 20u);
+    EXPECT_EQ(bytes(got.begin() + 20, got.end()), wrap_in_gre(0, GRE_TYPE_REDIRECT, packet, REDIRECT));
 }
 
 // Sends a datagram as a kernel on the same machine does, with a checksum that the device would complete.
-int send_partial() {
-    bytes inner = make_packet(PROTOCOL_UDP, 3, PARTIAL_DATAGRAM);
-    ip_header(&inner)->destination = to_be32(0xc0a80901);
-    fix_checksums(&inner);
+void send_partial() {
+    bytes inner = make_packet(PROTOCOL_UDP, 3, PARTIAL_DATAGRAM, AT_LINK);
     header_at<udp_wire_header>(&inner, 20)->checksum =
         checksum_fold(checksum_pseudo(*ip_header(&inner), inner.size() - 20));
     bytes packet = make_ip_packet(PROTOCOL_GRE, ROUTER, APPLIANCE, wrap_in_gre(0, GRE_TYPE_IPV4, inner));
@@ -407,193 +390,109 @@ int send_partial() {
     device.sll_family = AF_PACKET;
     device.sll_ifindex = static_cast<int>(if_nametoindex("vr"));
     const int fd = socket(AF_PACKET, SOCK_RAW, 0), on = 1;
-    const bool sent = setsockopt(fd, SOL_PACKET, PACKET_VNET_HDR, &on, sizeof on) == 0 &&
-                      bind(fd, reinterpret_cast<const sockaddr *>(&device), sizeof device) == 0 &&
-                      writev(fd, parts, 3) > 0;
+    EXPECT_EQ(setsockopt(fd, SOL_PACKET, PACKET_VNET_HDR, &on, sizeof on), 0);
+    EXPECT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&device), sizeof device), 0);
+    EXPECT_GT(writev(fd, parts, 3), 0);
     close(fd);
-    return sent ? 0 : 1;
 }
 
 // Three packets that may take the shortcut, of 36, 37 and 38 bytes, and some that may not.
-int send_for_shortcut() {
-    const bytes redirect = {0x80, 51, 7, 200};
-    const auto made = [](uint8_t protocol, size_t payload) {
-        bytes packet = make_packet(protocol, 1, payload);
-        ip_header(&packet)->destination = to_be32(0xc0a80901);
-        fix_checksums(&packet);
-        return packet;
-    };
-    const bytes plain = made(PROTOCOL_UDP, 8);
+void send_for_shortcut() {
+    const bytes plain = make_packet(PROTOCOL_UDP, 1, 8, AT_LINK);
     bytes corrupt = plain, fragment = plain, cut = plain;
     ip_header(&corrupt)->ttl--;
     ip_header(&fragment)->fragment = to_be16(0x2000);
     fix_checksums(&fragment);
     cut.pop_back();
-    for (const bytes &content : {corrupt, fragment, cut, made(PROTOCOL_TCP, 8)})
-        send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, content, redirect));
+    for (const bytes &content : {corrupt, fragment, cut, make_packet(PROTOCOL_TCP, 1, 8, AT_LINK)})
+        send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, content, REDIRECT));
     send_gre(ROUTER, wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, plain));
     send_gre(ROUTER, wrap_in_gre(0, 0x86dd, plain));
     send_gre(STRANGER, wrap_in_gre(0, GRE_TYPE_IPV4, plain));
     send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_IPV4, plain));
-    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 9)));
-    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, made(PROTOCOL_UDP, 10), redirect));
-    return 0;
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_UDP, 1, 9, AT_LINK)));
+    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_UDP, 1, 10, AT_LINK), REDIRECT));
 }
 
-// --- Two appliances: this one and STRANGER, in the router's namespace. Each takes the other for the owner of
-// all flows.
-
-bool believe_in_other(uint32_t self, uint32_t other, bool by_mask, std::string *out_error) {
+// Makes this process the appliance `self`, which takes `other` for the owner of all flows.
+bool believe_in_other(uint32_t self, uint32_t other, bool by_mask) {
     appliance_view view;
     view.tunnels[1] = {self, ROUTER};
     view.groups[51] = {"", self, 0, false, {{ROUTER, ROUTER, travel::gre, travel::gre}}};
     view.intercepts[51].to = 3128;
     view.protections[51] = {by_mask, {}, {other}, std::vector<uint32_t>(by_mask ? 1 : 256, other)};
     std::map<std::string, uint32_t> indices;
-    return user_plane.open(out_error) &&
-           reconcile_kernel_state(user_plane, make_wanted_state(view, {}, true), &indices, out_error);
-}
-
-int become_appliance(bool by_mask, std::string *out_error) {
-    return unshare(CLONE_NEWNS) != 0 || mount("", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-           mount("", "/run", "tmpfs", 0, nullptr) != 0 || system("ip link set lo up") != 0 ||
-           !believe_in_other(STRANGER, APPLIANCE, by_mask, out_error);
-}
-
-// Redirects a packet of a flow that neither appliance knows. The other one has to return it, once.
-int redirect_once() {
-    const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
-    send_gre(ROUTER, wrap_in_gre(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_TCP, 1, 9), {0x80, 51, 0, 9}));
-    int count = 0;
-    bytes got(2048);
-    for (pollfd waits = {back, POLLIN, 0}; poll(&waits, 1, count ? 300 : 3000) == 1; count++)
-        if (recv(back, got.data(), got.size(), 0) < 60 || to_host(ip_header(&got)->source) != STRANGER ||
-            header_at<ip4_wire_header>(&got, 24)->ttl != 58)
-            count += 10;
-    close(back);
-    return count == 1 ? 0 : 10 + count;
-}
-
-int child_main(int commands, int answers) {
-    prctl(PR_SET_PDEATHSIG, SIGKILL);
-    close_kernel_socket(); // when tests are repeated the parent has one, of its own namespace
-    if (unshare(CLONE_NEWNET) != 0)
-        return 1;
     std::string error;
-    for (char command = 'u';;) {
-        int result = 0;
-        if (command == 'h')
-            result = send_by_hand();
-        else if (command == 'c')
-            result = send_partial();
-        else if (command == 's')
-            result = send_for_shortcut();
-        else if (command == 'm' || command == 'b')
-            result = become_appliance(command == 'm', &error);
-        else if (command == 'r')
-            result = redirect_once();
-        if (result)
-            fprintf(stderr, "router: '%c' gave %d %s\n", command, result, error.c_str());
-        const char answer = result == 0 ? 'y' : 'n';
-        if (write(answers, &answer, 1) != 1 || read(commands, &command, 1) != 1)
-            return 0;
-    }
+    const bool done = user_plane.open(&error) &&
+                      reconcile_kernel_state(user_plane, make_wanted_state(view, {}, true), &indices, &error);
+    EXPECT_TRUE(done) << error;
+    return done;
 }
 
 struct live_plane : testing::Test {
-    pid_t child = -1;
-    int commands[2], answers[2];
+    const int home = open("/proc/self/ns/net", O_RDONLY), datagrams = socket(AF_INET, SOCK_DGRAM, 0);
+    int router = -1; // its namespace
+    std::string error;
 
     void SetUp() override {
-        ASSERT_EQ(pipe(commands), 0);
-        ASSERT_EQ(pipe(answers), 0);
-        child = start_child([this] {
-            close(commands[1]);
-            close(answers[0]);
-            return child_main(commands[0], answers[1]);
-        });
-        close(commands[0]);
-        close(answers[1]); // the child's death ends the wait for its answer
-        ASSERT_TRUE(answered());
-        const std::string pid = std::to_string(child), inside = "nsenter -t " + pid + " -n ip ";
-        run_shell("ip link add va address 02:00:00:00:00:01 type veth peer name vr netns " + pid);
+        ASSERT_EQ(bind_to(datagrams, INADDR_ANY, 80), 0);
+        ASSERT_EQ(unshare(CLONE_NEWNET), 0);
+        router = open("/proc/self/ns/net", O_RDONLY);
+        run_shell("ip link add vr type veth peer name va address 02:00:00:00:00:01 netns /proc/" +
+                  std::to_string(getpid()) + "/fd/" + std::to_string(home));
+        run_shell("ip addr add 10.0.0.2/24 dev vr && ip addr add 10.0.0.3/24 dev vr && ip link set vr up");
+        ASSERT_EQ(setns(home, CLONE_NEWNET), 0);
         run_shell("ip addr add 10.0.0.1/24 dev va && ip link set va up");
-        run_shell(inside + "addr add 10.0.0.2/24 dev vr && " + inside + "addr add 10.0.0.3/24 dev vr && " +
-                  inside + "link set vr up");
     }
     void TearDown() override {
         user_plane.close();
         user_plane_settings = {};
-        std::string error;
         EXPECT_TRUE(user_plane.drop_link("wccp0", &error)) << error;
         EXPECT_EQ(if_nametoindex("wccp0"), 0u);
-        run_shell(
-            "ip link del va"); // while the child lives: the end of its namespace removes the device as well
-        close(commands[1]);
-        close(answers[0]);
-        kill(child, SIGKILL);
-        wait_for_child(child);
+        run_shell("ip link del va");
+        for (const int fd : {home, router, datagrams})
+            close(fd);
     }
-    void order(char command) { ASSERT_EQ(write(commands[1], &command, 1), 1); }
-    bool answered() {
-        char answer = 0;
-        return read(answers[0], &answer, 1) == 1 && answer == 'y';
+    void act_as_router(const std::function<void()> &steps) const {
+        ASSERT_EQ(setns(router, CLONE_NEWNET), 0);
+        steps();
+        ASSERT_EQ(setns(home, CLONE_NEWNET), 0);
+    }
+    // Has wccp0 take the datagrams that send_...() send to it, and what they send elsewhere leave by it.
+    static void use_link() {
+        run_shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && "
+                  "ip route add 203.0.113.0/24 dev wccp0 && cd /proc/sys/net/ipv4/conf && "
+                  "echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter && echo 1 >wccp0/forwarding && "
+                  "echo 0 >wccp0/send_redirects");
     }
 };
 
 // Connections through the plane: scenario_traffic.
 TEST_F(live_plane, delivers_and_returns_packets_of_each_kind) {
-    std::string error;
-    uint32_t index = 0, again = 0;
+    uint32_t index = 0;
     user_plane_settings.redirect_header = true;
     ASSERT_TRUE(user_plane.probe(&error)) << error;
     ASSERT_TRUE(user_plane.open(&error)) << error;
     const link_wish wish = {1, APPLIANCE, ROUTER};
     ASSERT_TRUE(user_plane.make_link("wccp0", wish, &index, &error)) << error;
     EXPECT_EQ(index, if_nametoindex("wccp0"));
-    run_shell(
-        "ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && ip route add 203.0.113.0/24 dev "
-        "wccp0");
-    run_shell("cd /proc/sys/net/ipv4/conf && echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter && "
-              "echo 1 >wccp0/forwarding && echo 0 >wccp0/send_redirects");
-
-    const int datagrams = socket(AF_INET, SOCK_DGRAM | SOCK_NONBLOCK, 0);
-    ASSERT_EQ(bind_to(datagrams, INADDR_ANY, 80), 0);
-    const auto receive = [datagrams](size_t length) {
-        pollfd comes = {datagrams, POLLIN, 0};
-        EXPECT_EQ(poll(&comes, 1, 3000), 1);
-        bytes datagram(LARGE_DATAGRAM + 1);
-        EXPECT_EQ(recv(datagrams, datagram.data(), datagram.size(), 0), static_cast<ssize_t>(length));
-    };
+    use_link();
 
     // A redirected packet that no proxy wants is returned with its redirect header.
-    order('h');
-    EXPECT_TRUE(answered());
+    act_as_router(send_by_hand);
     plane_counters counters;
     user_plane.read_counters(&counters);
     link_counters link = counters.links["wccp0"];
     EXPECT_EQ(link.packets_in, 2u);
     EXPECT_EQ(link.bytes_in, 1500u + LARGE_DATAGRAM + 28);
-    receive(LARGE_DATAGRAM);
+    EXPECT_EQ(receive_packet(datagrams).size(), LARGE_DATAGRAM);
     EXPECT_EQ(link.packets_out, 1u);
     EXPECT_EQ(link.refused[REFUSED_FLAGS], 1u);
     EXPECT_EQ(counters.refused[REFUSED_SOURCE], 1u);
     EXPECT_EQ(counters.refused_sources, (std::map<uint32_t, uint64_t>{{STRANGER, 1}}));
 
-    order('c');
-    EXPECT_TRUE(answered());
-    receive(PARTIAL_DATAGRAM);
-
-    // The plane finds its interface again.
-    user_plane.close();
-    ASSERT_EQ(if_nametoindex("wccp0"), index);
-    ASSERT_TRUE(user_plane.open(&error)) << error;
-    ASSERT_TRUE(user_plane.make_link("wccp0", wish, &again, &error)) << error;
-    EXPECT_EQ(again, index);
-    order('c');
-    EXPECT_TRUE(answered());
-    receive(PARTIAL_DATAGRAM);
-    close(datagrams);
+    act_as_router(send_partial);
+    EXPECT_EQ(receive_packet(datagrams).size(), PARTIAL_DATAGRAM);
 
     // An interface that was deleted is made again, and the thread does not spin until then.
     run_shell("ip link del wccp0");
@@ -601,56 +500,65 @@ TEST_F(live_plane, delivers_and_returns_packets_of_each_kind) {
     const clock_t before = clock(); // processor time, of all threads
     usleep(300000);
     EXPECT_LT(clock() - before, CLOCKS_PER_SEC / 20);
-    ASSERT_TRUE(user_plane.make_link("wccp0", wish, &again, &error)) << error;
-    EXPECT_EQ(again, if_nametoindex("wccp0"));
+    ASSERT_TRUE(user_plane.make_link("wccp0", wish, &index, &error)) << error;
+    EXPECT_EQ(index, if_nametoindex("wccp0"));
     run_shell("ip link set wccp0 up");
 }
 
 TEST_F(live_plane, only_valid_udp_of_a_link_takes_the_shortcut) {
     packet_shortcut shortcut;
     tun_device tun;
-    std::string error;
     if (!shortcut_open(&shortcut, &error))
         GTEST_SKIP() << error;
     ASSERT_TRUE(tun_open("wccp0", &tun, &error)) << error;
-    run_shell("ip addr add 192.168.9.1/24 dev wccp0 && ip link set wccp0 up && cd /proc/sys/net/ipv4/conf && "
-              "echo 0 >all/rp_filter && echo 0 >wccp0/rp_filter");
+    use_link();
     shortcut_follow_devices(&shortcut);
     EXPECT_EQ(shortcut.devices.size(), 2u); // va, wccp0
     shortcut_add_link(&shortcut, APPLIANCE, ROUTER, tun.index);
-    const int datagrams = socket(AF_INET, SOCK_DGRAM, 0);
-    ASSERT_EQ(bind_to(datagrams, INADDR_ANY, 80), 0);
     for (const bool known : {true, false}) {
-        order('s');
-        ASSERT_TRUE(answered());
-        for (const ssize_t length : {8, 9, 10}) {
-            pollfd comes = {datagrams, POLLIN, 0};
-            bytes got(100);
-            ASSERT_EQ(poll(&comes, 1, known ? 3000 : 100), known);
-            if (known) {
-                EXPECT_EQ(recv(datagrams, got.data(), got.size(), 0), length);
-            }
-        }
+        act_as_router(send_for_shortcut);
+        for (const size_t length : {8u, 9u, 10u})
+            EXPECT_EQ(receive_packet(datagrams, known ? 3000 : 100).size(), known ? length : 0);
         const shortcut_link taken = shortcut_count(shortcut, APPLIANCE, ROUTER);
         EXPECT_EQ(taken.packets, known ? 3u : 0u);
         EXPECT_EQ(taken.bytes, known ? 36u + 37 + 38 : 0u);
         EXPECT_EQ(taken.redirect_headers, known ? 1u : 0u);
         shortcut_drop_link(&shortcut, APPLIANCE, ROUTER);
     }
-    close(datagrams);
     close(tun.fd);
     shortcut_close(&shortcut);
 }
 
+// The other one is a process in the router's namespace.
 TEST_F(live_plane, two_that_take_each_other_for_the_owner_exchange_a_packet_once) {
-    std::string error;
-    for (const char kind : {'m', 'b'}) {
-        SCOPED_TRACE(kind);
-        order(kind);
-        ASSERT_TRUE(answered());
-        ASSERT_TRUE(believe_in_other(APPLIANCE, STRANGER, kind == 'm', &error)) << error;
-        order('r');
-        EXPECT_TRUE(answered());
+    for (const bool by_mask : {true, false}) {
+        SCOPED_TRACE(by_mask);
+        int ready[2];
+        ASSERT_EQ(pipe(ready), 0);
+        const pid_t other = start_child([&] {
+            close_kernel_socket(); // it belongs to the appliance's namespace
+            const bool done =
+                setns(router, CLONE_NEWNET) == 0 && unshare(CLONE_NEWNS) == 0 &&
+                system("mount --make-rprivate / && mount -t tmpfs tmpfs /run && ip link set lo up") == 0 &&
+                believe_in_other(STRANGER, APPLIANCE, by_mask);
+            return done && write(ready[1], "", 1) == 1 ? pause() : 1;
+        });
+        close(ready[1]);
+        EXPECT_EQ(receive_packet(ready[0]).size(), 1u) << "the other one has failed";
+        close(ready[0]);
+        EXPECT_TRUE(believe_in_other(APPLIANCE, STRANGER, by_mask));
+        // A packet of a flow that neither appliance knows. The other one has to return it, once.
+        act_as_router([] {
+            const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
+            send_gre(ROUTER,
+                     wrap_in_gre(0, GRE_TYPE_REDIRECT, make_packet(PROTOCOL_TCP, 1, 9), {0x80, 51, 0, 9}));
+            bytes got = receive_packet(back);
+            ASSERT_EQ(got.size(), 24 + 61u);
+            EXPECT_EQ(to_host(ip_header(&got)->source), STRANGER);
+            EXPECT_EQ(header_at<ip4_wire_header>(&got, 24)->ttl, 58);
+            EXPECT_EQ(receive_packet(back, 300), bytes());
+            close(back);
+        });
         plane_counters counters;
         user_plane.read_counters(&counters);
         EXPECT_EQ(counters.links["wccp1"].packets_out, 1); // the member's
@@ -658,6 +566,8 @@ TEST_F(live_plane, two_that_take_each_other_for_the_owner_exchange_a_packet_once
         EXPECT_EQ(counters.links["wccp0"].packets_out, 0);
         EXPECT_TRUE(remove_kernel_state(user_plane, &error)) << error;
         user_plane.close();
+        kill(other, SIGKILL);
+        wait_for_child(other);
     }
 }
 

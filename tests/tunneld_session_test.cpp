@@ -1,23 +1,20 @@
 // tunneld's session with mgmtd and its health checks, with real sockets. mgmtd's server runs on the same
 // loop.
 #include <filesystem>
-#include <fstream>
-#include <list>
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
-#include "mgmt/node_paths.h"
 #include "peers/mgmtd/transport.h"
 #include "peers/tunneld/course.h"
 #include "peers/tunneld/flow_count.h"
 #include "peers/tunneld/health.h"
+#include "peers/tunneld/link_names.h"
 #include "peers/tunneld/session_config.h"
 #include "peers/tunneld/slot_owners.h"
 #include "runtime/ttime.h"
+#include "tests/support/mgmtd_fixture.h"
 #include "tests/support/test_host.h"
-
-using strings = std::vector<std::string>;
 
 // --- Configuration as text
 
@@ -78,9 +75,7 @@ TEST(Configuration, BadValuesAreBoundedAndLeftOut) {
         EXPECT_FALSE(read_configuration(nodes, &complaints).intercepts.contains(51)) << ports;
     }
     for (uint32_t i = 0; i < BYPASSES_MAX + 9; i++)
-        nodes.push_back(make_field(NODE_BYPASS_CONFIG "/10.1." + std::to_string(i / 256) + "." +
-                                       std::to_string(i % 256) + "\\/32",
-                                   ""));
+        nodes.push_back(make_field(NODE_BYPASS_CONFIG "/" + address_text(0x0a010000 + i) + "\\/32", ""));
     EXPECT_EQ(read_configuration(nodes, &complaints).bypasses.size(), BYPASSES_MAX);
     EXPECT_EQ(complaints.size(), COMPLAINTS_MAX);
 }
@@ -173,26 +168,25 @@ TEST(SlotOwners, PacketsGoToTheOwnerOrToTheOneWhoHadMostFlows) {
 // --- A loop with a timer
 
 namespace {
-struct Loop : testing::Test {
+struct ticking_loop {
     lew *wrapper = nullptr;
     loop_context *loop = nullptr;
     loop_event *ticker = nullptr;
-    std::function<void()> on_tick;
+    std::function<void()> on_tick = [] {};
 
-    Loop() {
+    ticking_loop() {
         EXPECT_EQ(lew_init(&wrapper), LC_OK);
         EXPECT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
         EXPECT_EQ(loop_event_new(loop, tick, this, &ticker), LC_OK);
         EXPECT_EQ(loop_event_set_timer(ticker, 2), LC_OK);
     }
-    ~Loop() override {
+    ~ticking_loop() {
         loop_event_free(&ticker);
         EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
     }
     static void tick(int, short, void *data) {
-        auto *self = static_cast<Loop *>(data);
-        if (self->on_tick)
-            self->on_tick();
+        auto *self = static_cast<ticking_loop *>(data);
+        self->on_tick();
         (void)loop_event_set_timer(self->ticker, 2);
     }
     bool wait_until(const std::function<bool()> &done, int64_t limit_ms = 5000) const {
@@ -206,27 +200,20 @@ struct Loop : testing::Test {
 // --- The session
 
 // mgmtd on the loop, and a wccpd that answers for one router of each of the groups 31 to 51.
-struct Session : Loop {
-    static constexpr uint32_t WCCPD = 0x10000, MGMTCTL = WCCPD + 1;
-    std::unique_ptr<server> daemon;
-    std::unique_ptr<transport> sockets;
-    std::list<owned_request> asked; // of wccpd
-    strings found;                  // in the answer to mgmtctl
-    std::string said, method = "not-set";
+struct Session : Mgmtd, ticking_loop {
+    transport sockets;
+    std::string method = "not-set";
     mgmt_link *link = nullptr;
     configured_view view;
     int readings = 0, owners_heard = 0;
 
-    Session() {
-        on_tick = [this] {
-            std::vector<pollfd> none;
-            if (sockets)
-                transport_round(sockets.get(), &none, 0);
-            answer_for_wccpd();
-        };
+    void SetUp() override {
+        Mgmtd::SetUp();
+        daemon.now_ms = lt_monotonic_ms;
+        sockets.next_id = 100; // the fixture has sessions without sockets, among them wccpd's
         session_callbacks callbacks;
-        callbacks.configured = [this](const configured_view &now) {
-            view = now;
+        callbacks.configured = [this](const configured_view &read) {
+            view = read;
             readings++;
         };
         callbacks.state = [] {
@@ -245,60 +232,39 @@ struct Session : Loop {
         stop_mgmtd();
     }
     void start_mgmtd() {
-        daemon = std::make_unique<server>();
-        sockets = std::make_unique<transport>();
-        daemon->now_ms = lt_monotonic_ms;
-        daemon->say = [this](const std::string &line) { said += line + "\n"; };
-        daemon->local_addresses = [] { return std::vector<local_address>{}; };
-        tree_refresh(&daemon->tree);
+        const auto keep = daemon.send;
         std::string error;
-        ASSERT_TRUE(transport_listen(sockets.get(), daemon.get(), &error)) << error;
-        const auto send = daemon->send;
-        daemon->send = [this, send](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
-            if (peer_id < WCCPD)
-                return send(peer_id, mtype, frame);
-            const owned_tbuffer buffer(frame);
-            if (mtype == bn_msg_query_request) {
-                EXPECT_EQ(bn_request_msg_deserialize(frame, 32, &asked.emplace_back().pointer), LC_OK);
-            } else if (peer_id == MGMTCTL) {
-                owned_response response;
-                EXPECT_EQ(bn_response_msg_deserialize(frame, 32, &response.pointer), LC_OK);
-                for (const event_field &each : fields_of(response.pointer))
-                    found.push_back(each.name + "=" + each.value.text);
-                found.push_back("code " + std::to_string(response.pointer->return_code));
-            }
+        ASSERT_TRUE(transport_listen(&sockets, &daemon, &error)) << error;
+        const auto send = daemon.send;
+        daemon.send = [=](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
+            (peer_id < 100 ? keep : send)(peer_id, mtype, frame);
         };
-        server_peer_opened(daemon.get(), WCCPD, "wccpd-1");
-        daemon->peers[WCCPD].interests.push_back({EVENT_CONFIG_CHANGE, {}});
+        on_tick = [this] {
+            std::vector<pollfd> none;
+            transport_round(&sockets, &none, 0);
+            answer_for_wccpd();
+        };
     }
     void stop_mgmtd() {
-        if (sockets)
-            transport_close(sockets.get());
-        sockets.reset();
-        daemon.reset();
-        asked.clear();
+        transport_close(&sockets);
+        on_tick = [] {};
     }
     void answer_for_wccpd() {
-        for (const owned_request &msg : std::exchange(asked, {})) {
-            owned_response response;
-            owned_tbuffer frame;
-            ASSERT_EQ(bn_query_response_msg_create(&response.pointer, msg.pointer->msg_id, 0, nullptr),
-                      LC_OK);
-            uint32_t id = 0;
-            const auto add = [&](const std::string &name, const std::string &text) {
-                bn_binding *binding = make_binding(name, {bn_type_str, text});
-                (void)bn_query_response_msg_append_binding_takeover(response.pointer, &binding, id);
+        for (size_t i = 0; i < sent.size(); i++) {
+            if (std::exchange(sent[i].mtype, 0) != bn_msg_query_request)
+                continue;
+            const bn_request_msg *msg = sent[i].request;
+            std::vector<event_field> fields;
+            const auto add = [&fields](const std::string &name, const std::string &text) {
+                fields.push_back(make_field(name, text));
             };
             int walks = 0;
-            for (uint32_t i = 0; i < bn_request_per_node_array_length_quick(msg.pointer->nodes); i++) {
-                const bn_request_node *node = bn_request_per_node_array_get_quick(msg.pointer->nodes, i);
-                const std::string name = name_of(node->binding);
-                id = node->node_id;
+            for (const auto &[name, value] : fields_of(msg)) {
                 for (int group = 31; group <= 51 && name == NODE_GROUP_STATE; group++)
                     add(name + "/" + std::to_string(group), std::to_string(group));
                 if (name == NODE_GROUP_STATE "/51/owners")
                     add(name, "hash members 192.0.2.3");
-                if (name.ends_with("/router") && node->subop == bn_query_iterate) {
+                if (name.ends_with("/router")) {
                     add(name + "/1/id", "192.0.2.1");
                     add(name + "/1/ipaddr", "192.0.2.2");
                     add(name + "/1/fwd_method", method == "L2" ? "GRE" : method);
@@ -307,15 +273,8 @@ struct Session : Loop {
                 }
             }
             EXPECT_LE(walks, 8) << "wccpd is kept busy for long";
-            response.pointer->service_id = 2;
-            ASSERT_EQ(bn_response_msg_serialize(response.pointer, 32, &frame.pointer), LC_OK);
-            EXPECT_TRUE(server_take_frame(daemon.get(), WCCPD, bn_msg_query_response, frame.pointer));
+            answer(1, msg->msg_id, last_node(msg)->node_id, 0, fields);
         }
-    }
-    void set(const std::string &name, const std::string &text) {
-        const commit_result result =
-            server_commit(daemon.get(), {{set_kind::create, name, bn_type_str, text}}, {"test"});
-        EXPECT_EQ(result.code, 0u) << result.message;
     }
 };
 } // namespace
@@ -325,11 +284,9 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     start_mgmtd();
     ASSERT_TRUE(wait_until([&] { return readings == 1; })) << said;
     EXPECT_TRUE(view.groups.empty());
-    set(NODE_GROUP_CONFIG "/51/interface", "lo");
-    set(NODE_GROUP_CONFIG "/51/router/1/ipaddr", "192.0.2.2");
-    set(NODE_GROUP_CONFIG "/31/interface", "lo");
-    set(NODE_INTERCEPT_CONFIG "/51/ports", "80");
-    set(NODE_INTERCEPT_CONFIG "/51/to", "3128");
+    EXPECT_EQ(set("+interface=lo +router/1/ipaddr=192.0.2.2 +31/interface=lo +" NODE_INTERCEPT_CONFIG
+                  "/51/ports=80 +" NODE_INTERCEPT_CONFIG "/51/to=3128"),
+              0u);
     ASSERT_TRUE(wait_until([&] {
         return view.intercepts.size() == 1 && view.groups[51].routers.size() == 1 &&
                view.groups[31].routers.size() == 1;
@@ -342,7 +299,7 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     ASSERT_TRUE(wait_until([&] { return owners_heard > 0; }));
     const int heard = owners_heard;
     EXPECT_TRUE(wait_until([&] { return owners_heard >= heard + 2; }));
-    set(NODE_PROTECTION_TIME, "0");
+    EXPECT_EQ(set("+" NODE_PROTECTION_TIME "=0"), 0u);
     ASSERT_TRUE(wait_until([&] { return view.protection_s == 0; }));
     owners_heard = 0;
     EXPECT_FALSE(wait_until([&] { return owners_heard > 1; }, 2500));
@@ -361,8 +318,8 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
 
     // After a refusal, the configuration is requested again.
     int refusals = 0;
-    daemon->fits = [&](uint32_t, size_t) { return refusals++ > 0; };
-    set(NODE_GROUP_CONFIG "/51/policy_grp", "7");
+    daemon.fits = [&](uint32_t peer_id, size_t) { return peer_id < 100 || refusals++ > 0; };
+    EXPECT_EQ(set("+policy_grp=7"), 0u);
     EXPECT_TRUE(wait_until([&] { return view.groups[51].policy_group == 7; }));
     EXPECT_GT(refusals, 0);
     before = readings;
@@ -371,9 +328,9 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
     stop_mgmtd();
     ASSERT_TRUE(wait_until([&] { return !mgmt_link_is_open(link); }));
     mgmt_link_group_leaves(link, 51, "without a session");
+    EXPECT_EQ(set("-" NODE_INTERCEPT_CONFIG "/51"), 0u);
     EXPECT_EQ(readings, before);
     start_mgmtd();
-    set(NODE_GROUP_CONFIG "/51/interface", "lo");
     ASSERT_TRUE(wait_until([&] { return readings > before; })) << "given anew, for it may have to report";
     EXPECT_TRUE(view.intercepts.empty());
     EXPECT_EQ(view.groups[51].routers, std::vector<group_router>{known});
@@ -382,27 +339,21 @@ TEST_F(Session, FollowsMgmtdThroughItsAbsences) {
 TEST_F(Session, AnswersForItsStateAndReports) {
     start_mgmtd();
     ASSERT_TRUE(wait_until([&] { return readings == 1; })) << said;
-    server_peer_opened(daemon.get(), MGMTCTL, "mgmtctl-2");
     const auto ask = [&](const std::string &name, uint32_t subop, uint32_t flags) {
-        owned_request msg;
-        found.clear();
-        (void)bn_query_request_msg_create(&msg.pointer, 0, nullptr);
-        (void)bn_query_request_msg_append_str(msg.pointer, subop, flags, name.c_str(), nullptr);
-        server_answer_query(daemon.get(), MGMTCTL, msg.pointer);
-        EXPECT_TRUE(wait_until([&] { return !found.empty(); })) << name;
-        return found;
+        clear();
+        query(3, name, subop, flags);
+        EXPECT_TRUE(wait_until([&] { return code() == 0; })) << name;
+        return found();
     };
-    EXPECT_EQ(ask(NODE_TUNNEL_STATE "/12/index", bn_query_get, 0),
-              (strings{NODE_TUNNEL_STATE "/12/index=8", "code 0"}));
-    EXPECT_EQ(
-        ask(NODE_PROTECTION_STATE "/group", bn_query_iterate, bn_qf_subtree),
-        (strings{NODE_PROTECTION_STATE "/group/51=51", NODE_PROTECTION_STATE "/group/51/slots=9", "code 0"}));
+    EXPECT_EQ(ask(NODE_TUNNEL_STATE "/12/index", bn_query_get, 0), strings{NODE_TUNNEL_STATE "/12/index=8"});
+    EXPECT_EQ(ask(NODE_PROTECTION_STATE "/group", bn_query_iterate, bn_qf_subtree),
+              (strings{NODE_PROTECTION_STATE "/group/51=51", NODE_PROTECTION_STATE "/group/51/slots=9"}));
     EXPECT_EQ(ask(NODE_TUNNEL_STATE, bn_query_iterate, 0),
-              (strings{NODE_TUNNEL_STATE "/3=3", NODE_TUNNEL_STATE "/12=12", "code 0"}));
+              (strings{NODE_TUNNEL_STATE "/3=3", NODE_TUNNEL_STATE "/12=12"}));
     EXPECT_EQ(ask(NODE_TUNNEL_STATE, bn_query_iterate, bn_qf_subtree | bn_qf_leaves_only),
-              (strings{NODE_TUNNEL_STATE "/3/index=7", NODE_TUNNEL_STATE "/12/index=8", "code 0"}));
+              (strings{NODE_TUNNEL_STATE "/3/index=7", NODE_TUNNEL_STATE "/12/index=8"}));
     for (const char *none : {NODE_TUNNEL_STATE "/4/index", NODE_TUNNEL_STATE})
-        EXPECT_EQ(ask(none, bn_query_get, 0), strings{"code 0"});
+        EXPECT_EQ(ask(none, bn_query_get, 0), strings());
 
     // A query for nodes of both daemons.
     const strings all = ask("/qv", bn_query_iterate, bn_qf_subtree | bn_qf_leaves_only);
@@ -411,13 +362,13 @@ TEST_F(Session, AnswersForItsStateAndReports) {
 
     // mgmtd reports an orderly end, unless it has started the process and sees the end itself.
     const auto is_reported = [&] {
-        return said.find("process tunneld: " EVENT_PROCESS_TERMINATE) != said.npos;
+        return bool(contains(said, "process tunneld: " EVENT_PROCESS_TERMINATE));
     };
     mgmt_link_ends(link);
     EXPECT_TRUE(wait_until(is_reported)) << said;
     said.clear();
     bool asked_whether = false;
-    daemon->is_news = [&](const std::string &process) {
+    daemon.is_news = [&](const std::string &process) {
         return (asked_whether = process == "tunneld", false);
     };
     mgmt_link_ends(link);
@@ -427,31 +378,37 @@ TEST_F(Session, AnswersForItsStateAndReports) {
 // --- Health
 
 namespace {
-// A server on loopback that answers each request with `answer`.
-struct proxy {
-    int listener;
+// With a proxy on loopback that answers each request with `answer`, unless that is empty.
+struct Health : testing::Test, ticking_loop {
+    const int listener = socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     uint16_t port = 0;
-    std::string answer; // "": none
+    std::string answer, heard;
     std::vector<int> clients;
-    std::string heard;
     int resets = 0;
+    health_monitor *monitor = nullptr;
+    size_t changes = 0;
+    const std::string directory = "/tmp/health/";
 
-    proxy() : listener(socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0)) {
+    Health() {
         sockaddr_in address = {};
         socklen_t length = sizeof address;
         EXPECT_EQ(bind_to(listener, INADDR_LOOPBACK), 0);
         EXPECT_EQ(listen(listener, 300), 0);
         EXPECT_EQ(getsockname(listener, reinterpret_cast<sockaddr *>(&address), &length), 0);
         port = ntohs(address.sin_port);
+        on_tick = [this] { serve(); };
+        monitor = health_new(loop, [this](uint8_t group) { changes += group == 51; });
+        std::filesystem::create_directory(directory);
     }
-    ~proxy() {
-        end();
+    ~Health() override {
+        health_free(monitor);
+        end_clients();
         close(listener);
+        std::filesystem::remove_all(directory);
     }
-    void end() {
-        for (const int fd : clients)
+    void end_clients() {
+        for (const int fd : std::exchange(clients, {}))
             close(fd);
-        clients.clear();
     }
     void serve() {
         for (int fd; (fd = accept4(listener, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC)) >= 0;)
@@ -467,59 +424,41 @@ struct proxy {
                 (void)send(fd, answer.data(), answer.size(), MSG_NOSIGNAL);
         }
     }
-};
-
-struct Health : Loop {
-    proxy server;
-    health_monitor *monitor = nullptr;
-    std::vector<uint8_t> changed;
-    char directory[32] = "/tmp/health-test-XXXXXX";
-
-    Health() {
-        EXPECT_TRUE(mkdtemp(directory));
-        on_tick = [this] { server.serve(); };
-        monitor = health_new(loop, [this](uint8_t group) { changed.push_back(group); });
-    }
-    ~Health() override {
-        health_free(monitor);
-        std::filesystem::remove_all(directory);
-    }
     const proxy_health &state() const { return health_states(monitor).at(51); }
-    void watch(const health_check &check, uint16_t port) const {
+    void watch(const health_check &check) const {
         intercept rules;
         rules.to = port;
         rules.check = check;
         health_set_checks(monitor, {{51, rules}});
     }
-    std::string path(const char *name) const { return std::string(directory) + "/" + name; }
     // Sets a check and returns the state after its first result.
-    std::string first_result(const health_check &check, uint16_t port) const {
+    std::string first_result(const health_check &check) const {
         health_set_checks(monitor, {});
-        watch(check, port);
+        watch(check);
         EXPECT_TRUE(wait_until([&] { return state().checks == 1; })) << check.argument;
         return state().state == proxy_health::up ? "up" : state().reason;
     }
     std::string result_of_script(const std::string &content) const {
-        std::ofstream(path("check")) << "#!/bin/sh\n" << content << "\n";
-        chmod(path("check").c_str(), 0755);
-        return first_result({check_kind::command, path("check"), 1, 1, 1}, 1);
+        std::ofstream(directory + "check") << "#!/bin/sh\n" << content << "\n";
+        chmod((directory + "check").c_str(), 0755);
+        return first_result({check_kind::command, directory + "check", 1, 1, 1});
     }
 };
 } // namespace
 
 TEST_F(Health, TheFirstResultSettlesAndLaterOnesHaveToAgree) {
-    watch({check_kind::tcp, "", 1, 2, 2}, server.port);
+    watch({check_kind::tcp, "", 1, 2, 2});
     EXPECT_EQ(state().state, proxy_health::unknown);
-    ASSERT_TRUE(wait_until([&] { return changed.size() == 1; }, 500)) << "at once";
+    ASSERT_TRUE(wait_until([&] { return changes == 1; }, 500)) << "at once";
     EXPECT_EQ(state().state, proxy_health::up);
-    EXPECT_TRUE(wait_until([&] { return server.resets == 1; })) << "reset, not closed";
-    watch({check_kind::tcp, "", 1, 2, 2}, server.port);
+    EXPECT_TRUE(wait_until([&] { return resets == 1; })) << "reset, not closed";
+    watch({check_kind::tcp, "", 1, 2, 2});
     EXPECT_EQ(state().checks, 1u) << "the same check goes on";
 
-    close(server.listener);
+    close(listener);
     ASSERT_TRUE(wait_until([&] { return state().failures == 1; }));
     EXPECT_EQ(state().state, proxy_health::up);
-    ASSERT_TRUE(wait_until([&] { return changed.size() == 2; }));
+    ASSERT_TRUE(wait_until([&] { return changes == 2; }));
     EXPECT_EQ(state().state, proxy_health::down);
     EXPECT_EQ(state().failures, 2u);
     EXPECT_EQ(state().reason, "connection refused");
@@ -529,41 +468,36 @@ TEST_F(Health, TheFirstResultSettlesAndLaterOnesHaveToAgree) {
 
 TEST_F(Health, EachKindOfCheckHasItsReasons) {
     const health_check http = {check_kind::http, "/ok", 1, 1, 1};
-    const struct {
-        const char *answer, *result;
-    } answers[] = {
+    const std::pair<const char *, const char *> answers[] = {
         {"HTTP/1.1 204 No Content\r\n\r\n", "up"},
         {"HTTP/1.0 399 x\r\n", "up"},
         {"HTTP/1.1 503 Service Unavailable\r\n\r\n", "status 503"},
         {"SSH-2.0-x\r\n", "no HTTP answer"},
         {"", "no answer in 1000 ms"},
     };
-    for (const auto &[answer, result] : answers) {
-        server.answer = answer;
-        EXPECT_EQ(first_result(http, server.port), result) << answer;
-        server.end();
+    for (const auto &[given, result] : answers) {
+        answer = given;
+        EXPECT_EQ(first_result(http), result) << given;
+        end_clients();
     }
-    EXPECT_TRUE(server.heard.starts_with("GET /ok HTTP/1.0\r\nHost: 127.0.0.1:")) << server.heard;
-    server.answer = std::string(1 << 20, 'x');
-    EXPECT_EQ(first_result(http, server.port), "no HTTP answer");
+    EXPECT_TRUE(heard.starts_with("GET /ok HTTP/1.0\r\nHost: 127.0.0.1:")) << heard;
+    answer = std::string(1 << 20, 'x');
+    EXPECT_EQ(first_result(http), "no HTTP answer");
 
     setenv("SECRET", "1", 1);
     EXPECT_EQ(result_of_script("test -z \"$SECRET\" && test ! -e /proc/self/fd/4"), "up");
     EXPECT_EQ(result_of_script("exit 3"), "exit status 3");
     EXPECT_EQ(result_of_script("kill -9 $$"), "ended by SIGKILL");
-    EXPECT_EQ(first_result({check_kind::command, path("none"), 1, 1, 1}, 1),
-              path("none") + ": No such file or directory");
+    EXPECT_EQ(first_result({check_kind::command, directory + "none", 1, 1, 1}),
+              directory + "none" + ": No such file or directory");
     // A command's children are killed when it ends, and when its time is up.
     for (const auto &[after, result] : {std::pair{"", "up"}, {"; wait", "no answer in 1000 ms"}}) {
-        EXPECT_EQ(result_of_script("sleep 100 & echo $! >" + path("pid") + after), result);
-        std::ifstream file(path("pid"));
-        pid_t pid = 0;
-        file >> pid;
+        EXPECT_EQ(result_of_script("sleep 100 & echo $! >" + directory + "pid" + after), result);
+        const int pid = atoi(text_of_file(directory + "pid").c_str());
         ASSERT_GT(pid, 0);
-        const auto gone = [&] {
-            std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
-            std::string number, name, letter;
-            return !(stat >> number >> name >> letter) || letter == "Z";
+        const auto gone = [pid] {
+            const std::string stat = text_of_file("/proc/" + std::to_string(pid) + "/stat");
+            return stat.empty() || contains(stat, ") Z ");
         };
         EXPECT_TRUE(wait_until(gone)) << pid;
     }

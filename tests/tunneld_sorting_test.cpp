@@ -19,32 +19,29 @@ constexpr sorted_as TO_PROXY = SORTED_TO_PROXY, RETURNED = SORTED_RETURNED;
 constexpr uint32_t CLIENT = 0xAC100005, SERVER = 0xC6336405, OWN = 0x0A000001, ROUTER = 0xC0000201;
 constexpr uint32_t SPARED = 0x0A090101, BYPASSED = 0xCB007107; // bypassed for a group, and for all
 
+uint16_t next_port = 20000;
 struct packet {
     uint32_t source = CLIENT, destination = SERVER;
     uint8_t protocol = 6, flags = SYN;
-    uint16_t port = 80, from = 0; // 0: one that was not used before
+    uint16_t port = 80, from = next_port++;
     uint32_t sequence = 1, acknowledged = 0;
     std::string text = "";
 };
 
-uint32_t number_at_offset(const bytes &packet, size_t at, size_t size) {
-    uint32_t value = 0;
-    for (size_t i = at; i < at + size && i < packet.size(); i++)
-        value = value << 8 | packet[i];
-    return value;
+// For packets that are long enough.
+const tcp_wire_header *tcp_of(const bytes &packet) {
+    return reinterpret_cast<const tcp_wire_header *>(&packet[20]);
 }
 bytes make_bytes(const packet &what) {
     wire_bytes body;
     body.u16(what.from).u16(what.port);
     const bool syn = what.flags & SYN;
+    const char *const rest = syn ? "ffff 00*4 020405b4" : "ffff 00*4";
     if (what.protocol == PROTOCOL_UDP)
         body.zeros(4);
     else
-        body.u32(what.sequence).u32(what.acknowledged).u8(syn ? 0x60 : 0x50).u8(what.flags).hex("ffff 00*4");
-    if (syn && what.protocol != PROTOCOL_UDP)
-        body.hex("020405b4");
-    for (const char letter : what.text)
-        body.u8(static_cast<uint8_t>(letter));
+        body.u32(what.sequence).u32(what.acknowledged).u8(syn ? 0x60 : 0x50).u8(what.flags).hex(rest);
+    body.bytes.insert(body.bytes.end(), what.text.begin(), what.text.end());
     return make_ip_packet(what.protocol, what.source, what.destination, body.bytes);
 }
 
@@ -52,7 +49,6 @@ enum device { LINK, LAN, OUT, MEMBER, DEVICES };
 constexpr const char *device_names[DEVICES] = {"wccp0", "lan0", "out0", "wccp9"};
 constexpr uint32_t PASSED_ON = MARK_PASS + 9;
 int devices[DEVICES];
-uint16_t next_port = 20000;
 
 void write_to_device(device where, const bytes &sent) {
     ASSERT_EQ(write(devices[where], sent.data(), sent.size()), static_cast<ssize_t>(sent.size()));
@@ -85,8 +81,7 @@ int listen_on(int type, uint32_t address, uint16_t port) {
     const int fd = socket(AF_INET, type | SOCK_NONBLOCK | SOCK_CLOEXEC, 0), on = 1;
     setsockopt(fd, IPPROTO_IP, IP_TRANSPARENT, &on, sizeof(on));
     EXPECT_EQ(bind_to(fd, address, port), 0) << strerror(errno);
-    if (type == SOCK_STREAM)
-        listen(fd, 100);
+    listen(fd, 100); // has no effect on datagrams
     return fd;
 }
 
@@ -124,27 +119,28 @@ struct Sorting : testing::Test {
                 "for d in wccp0 lan0 out0 wccp9; do echo 1 >$d/forwarding; echo 0 >$d/rp_filter\n"
                 "    echo 1 >$d/accept_local; ip link set $d up; done\n"
                 "ip route add default dev out0; ip route add local default dev lo table 204800\n"
-                "ip route add default dev wccp0 table 204801\n"
                 "ip rule add pref 2048 fwmark 0x57430001 lookup 204800\n"
                 "ip rule add pref 2049 fwmark 0x57430002 lookup main\n"
-                "ip rule add pref 2050 fwmark 0x57430100 lookup 204801\n"
-                "ip route add default dev wccp9 table 270346\n"
-                "ip rule add pref 2050 fwmark 0x57450009 lookup 270346\n"
-                "ip rule add pref 2051 iif wccp0 lookup 204801\n"
-                "ip rule add pref 2051 iif wccp9 lookup 204801"),
+                "add() { ip route add default dev $1 table $2; ip rule add pref 2050 fwmark $3 lookup $2; }\n"
+                "add wccp0 204801 0x57430100; add wccp9 270346 0x57450009\n"
+                "for d in wccp0 wccp9; do ip rule add pref 2051 iif $d lookup 204801; done"),
             0);
         listen_on(SOCK_STREAM, INADDR_ANY, 3128);
         listen_on(SOCK_STREAM, INADDR_LOOPBACK, 3129);
         udp = listen_on(SOCK_DGRAM, INADDR_ANY, 3128);
     }
     ~Sorting() override {
-        std::string error;
-        EXPECT_TRUE(remove_sorting_rules(&error) && remove_sorting_rules(&error)) << error;
+        remove_rules();
+        remove_rules();
         EXPECT_EQ(system("[ -z \"$(nft list ruleset)\" ]"), 0);
     }
     static void apply(const wanted_sorting &wanted) {
         std::string error;
         EXPECT_TRUE(apply_sorting_rules(wanted, &error)) << error;
+    }
+    static void remove_rules() {
+        std::string error;
+        EXPECT_TRUE(remove_sorting_rules(&error)) << error;
     }
     static sorting_counters counters() {
         sorting_counters read;
@@ -154,39 +150,35 @@ struct Sorting : testing::Test {
     }
     // Sends a packet and returns the result: the device from which it was read, "answer" or "refused" for a
     // reply of a TCP socket, "datagram" for the UDP socket, or "".
-    static std::string send(packet what, device by = LINK, bytes *out_answer = nullptr) {
-        if (what.from == 0)
-            what.from = next_port++;
+    static std::string send(const packet &what, device by = LINK, bytes *out_answer = nullptr) {
         drain_devices();
         write_to_device(by, make_bytes(what));
         device where = DEVICES;
         const bytes got = take_packet(
             [&](const bytes &each) {
-                return each.size() >= 28 && (number_at_offset(each, 20, 2) == what.from ||
-                                             number_at_offset(each, 22, 2) == what.from);
+                return each.size() >= 28 && (to_host(tcp_of(each)->source_port) == what.from ||
+                                             to_host(tcp_of(each)->destination_port) == what.from);
             },
             &where);
         char buffer[64];
         if (what.protocol == 17 && recv(udp, buffer, sizeof(buffer), 0) >= 0)
             return "datagram";
-        if (got.empty() || number_at_offset(got, 20, 2) == what.from)
+        if (got.empty() || to_host(tcp_of(got)->source_port) == what.from)
             return got.empty() ? "" : device_names[where];
         if (out_answer)
             *out_answer = got;
-        return number_at_offset(got, 33, 1) == (SYN | ACK) ? "answer" : "refused";
+        return tcp_of(got)->flags == (SYN | ACK) ? "answer" : "refused";
     }
-    static int udp;
+    inline static int udp;
 };
-int Sorting::udp;
 
 } // namespace
 
 TEST_F(Sorting, PacketsGoWhereTheyShould) {
     using W = wanted_sorting;
     static const auto pass_group_5 = [](W &w) {
-        w.groups[0].mask = {7, 0, 0, 0};
-        w.groups[0].pass_marks.assign(8, 0);
-        w.groups[0].pass_marks[CLIENT & 7] = PASSED_ON;
+        w.groups[0].mask = {5, 0, 0, 0};
+        w.groups[0].pass_marks = {0, 0, 0, PASSED_ON};
     };
     static const auto choose_passing = [](W &w) {
         pass_group_5(w);
@@ -203,12 +195,8 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
     static const auto bypass_client = [](W &w) { w.bypasses = {{CLIENT, 32}}; };
     static const auto bypass_all = [](W &w) { w.bypasses = {{0, 0}}; };
     static const auto end_proxy = [](W &w) { w.groups[0].condition.proxy_up = false; };
-    static const auto fail_closed = [](W &w) {
-        w.groups[0].condition.proxy_up = false, w.groups[0].rules.drop_when_down = true;
-    };
-    static const auto deactivate = [](W &w) {
-        w.groups[0].condition.active = false, w.groups[0].rules.drop_when_down = true;
-    };
+    static const auto end_last_proxy = [](W &w) { w.groups[2].condition.proxy_up = false; };
+    static const auto deactivate = [](W &w) { w.groups[0].condition.active = false; };
     static const auto use_free_port = [](W &w) { w.groups[0].rules.to = 3999; };
     static const auto use_loopback = [](W &w) { w.groups[0].rules.to = 3129; };
     static const auto forward_rest = [](W &w) {
@@ -255,8 +243,8 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
         {"a bypassed server", {.destination = BYPASSED}, LINK, "wccp0", SORTED_BYPASSED, 0},
         {"no bypass any more", {.source = BYPASSED}, LINK, "answer", TO_PROXY, 5, bypass_client},
         {"everything is bypassed", {}, LINK, "wccp0", SORTED_BYPASSED, 0, bypass_all},
-        {"proxy down", {}, LINK, "wccp0", SORTED_DOWN, 5, end_proxy},
-        {"fail closed", {}, LINK, "", SORTED_DOWN, 5, fail_closed},
+        {"proxy down", {.port = 8100}, LINK, "wccp0", SORTED_DOWN, 7, end_last_proxy},
+        {"fail closed", {}, LINK, "", SORTED_DOWN, 5, end_proxy},
         {"not active", {}, LINK, "wccp0", SORTED_DOWN, 5, deactivate},
         {"nobody listens", {}, LINK, "wccp0", RETURNED, 5, use_free_port},
         {"a proxy on loopback", {}, LINK, "answer", TO_PROXY, 5, use_loopback},
@@ -267,7 +255,7 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
         {"one without an intercept", {.port = 443}, LAN, "out0", RETURNED, 0, drop_beside_idle},
         {"a flow to be passed on", {.flags = ACK}, LINK, "wccp9", SORTED_PASSED, 5, pass_group_5},
         {"the same by L2", {.flags = ACK}, LAN, "wccp9", SORTED_PASSED, 5, pass_group_5},
-        {"of another slot", {.source = CLIENT + 1, .flags = ACK}, LINK, "wccp0", RETURNED, 5, pass_group_5},
+        {"of another slot", {.source = CLIENT - 1, .flags = ACK}, LINK, "wccp0", RETURNED, 5, pass_group_5},
         {"a new flow in that slot", {}, LINK, "answer", TO_PROXY, 5, pass_group_5},
         {"passed on to this appliance", {.flags = ACK}, MEMBER, "wccp0", RETURNED, 0, pass_group_5},
         {"chosen by the plane", {.flags = ACK}, MEMBER, "wccp0", SORTED_PASSED, 0, choose_passing},
@@ -280,6 +268,7 @@ TEST_F(Sorting, PacketsGoWhereTheyShould) {
     for (const auto &row : rows) {
         SCOPED_TRACE(row.what);
         wanted_sorting wanted = make_wanted();
+        wanted.groups[0].rules.drop_when_down = true;
         row.change(wanted);
         apply(wanted);
         sorting_counters before = counters();
@@ -303,23 +292,22 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
     wanted_sorting wanted = make_wanted();
     wanted.groups[0].rules.to = 3130;
     apply(wanted);
-    packet next{.from = next_port++};
+    const packet first;
     bytes answer;
-    ASSERT_EQ(send(next, LINK, &answer), "answer");
-    EXPECT_EQ(number_at_offset(answer, 40, 4), 0x02040000u | wanted.mss); // the segment size fits the tunnel
+    ASSERT_EQ(send(first, LINK, &answer), "answer");
+    EXPECT_EQ(bytes(answer.begin() + 40, answer.end()), hex("0204 0578").bytes); // fits the tunnel: 1400
     EXPECT_GE(counters().clamped, 1); // more when a socket repeats its answer
+    const uint32_t next = to_host(tcp_of(answer)->sequence) + 1;
     // Later packets of the flow don't depend on the group's rules.
     wanted.groups[0].condition.proxy_up = false;
     wanted.bypasses = {{0, 0}};
     wanted.groups[0].pass_marks = {PASSED_ON};
     apply(wanted);
-    next.flags = ACK;
-    next.sequence = 2;
-    next.acknowledged = number_at_offset(answer, 24, 4) + 1;
-    EXPECT_EQ(send(next, MEMBER), ""); // from another appliance
+    packet later = {.flags = ACK, .from = first.from, .sequence = 2, .acknowledged = next};
+    EXPECT_EQ(send(later, MEMBER), ""); // from another appliance
     EXPECT_EQ(counters().interfaces["wccp9"][TO_PROXY].packets, 1);
-    next.text = "hello";
-    EXPECT_EQ(send(next), "refused"); // acknowledged
+    later.text = "hello";
+    EXPECT_EQ(send(later), "refused"); // acknowledged
     const int flow = accept(listener, nullptr, nullptr);
     char buffer[16];
     EXPECT_EQ(recv(flow, buffer, sizeof(buffer), 0), 5);
@@ -327,19 +315,14 @@ TEST_F(Sorting, AFlowStaysWithItsSocket) {
     // The proxy closes first, which leaves a TIME_WAIT socket: the client's FIN belongs to it. A new flow
     // from the same port goes to the proxy, too, or gets an acknowledgement of the old flow.
     close(flow);
-    next.sequence += 5;
-    next.acknowledged++;
-    next.text = "";
-    next.flags = FIN | ACK;
-    send(next);
+    send({.flags = FIN | ACK, .from = first.from, .sequence = 7, .acknowledged = next + 1});
     EXPECT_EQ(counters().interfaces["wccp0"][TO_PROXY].packets, 3);
-    next.flags = SYN;
-    next.sequence += 100000;
-    EXPECT_EQ(send(next), "refused");
+    const packet again = {.from = first.from, .sequence = 100007};
+    EXPECT_EQ(send(again), "refused");
     wanted = make_wanted();
     wanted.groups[0].rules.to = 3130;
     apply(wanted);
-    EXPECT_EQ(send(next), "answer");
+    EXPECT_EQ(send(again), "answer");
     close(listener);
 }
 
@@ -373,16 +356,16 @@ TEST_F(Sorting, ChangesAreWholeOrNone) {
     wanted_sorting wanted = make_wanted();
     wanted.members.clear();
     std::string error;
-    EXPECT_TRUE(remove_sorting_rules(&error)) << error;
-    ASSERT_EQ(wait_for_child(start_child([&wanted] {
-                  wanted_sorting earlier = wanted;
-                  earlier.links = {"wccp0", "wccp9"};
-                  earlier.groups[0].interfaces.push_back("wccp9");
-                  earlier.groups.push_back(make_group(9, 6, {}));
-                  apply(earlier);
-                  return send({.port = 443}) == "answer" && send({}) == "answer" ? 0 : 1;
-              })),
-              0);
+    remove_rules();
+    run_program([&wanted] {
+        wanted_sorting earlier = wanted;
+        earlier.links = {"wccp0", "wccp9"};
+        earlier.groups[0].interfaces.push_back("wccp9");
+        earlier.groups.push_back(make_group(9, 6, {}));
+        apply(earlier);
+        EXPECT_EQ(send({.port = 443}), "answer");
+        EXPECT_EQ(send({}), "answer");
+    });
     next_port += 2;
     apply(wanted);
     sorting_counters read = counters();
@@ -421,7 +404,7 @@ TEST_F(Sorting, ChangesAreWholeOrNone) {
         EXPECT_EQ(send({}), "answer");
     }
     // A table of the same name with other content is replaced.
-    EXPECT_TRUE(remove_sorting_rules(&error)) << error;
+    remove_rules();
     ASSERT_TRUE(run_nft("add table ip tunneld\nadd map ip tunneld arrivals { type ipv4_addr : verdict; }\n"
                         "add set ip tunneld classes { type mark; }\n",
                         &error))
@@ -468,8 +451,7 @@ TEST_F(Sorting, ManyLinksAndGroupsAreQuick) {
         wanted.bypasses.push_back({CLIENT, 32});
         timed("a bypass", 300, apply_it);
         EXPECT_EQ(send({.port = 1000 + 10 * 129}), "wccp0");
-        std::string error;
         timed("reading", 1000, [] { counters(); });
-        EXPECT_TRUE(remove_sorting_rules(&error)) << error;
+        remove_rules();
     }
 }

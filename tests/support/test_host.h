@@ -2,6 +2,7 @@
 #pragma once
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <linux/if_tun.h>
 #include <net/if.h>
 #include <netinet/in.h>
@@ -54,4 +55,12 @@ inline int wait_for_child(pid_t child) {
     int status = -1;
     waitpid(child, &status, 0);
     return status;
+}
+// Runs the steps in a process that does not clean up. Their failures fail this test.
+inline void run_program(const std::function<void()> &steps) {
+    const pid_t child = start_child([&] {
+        steps();
+        return testing::Test::HasFailure() ? 1 : 0;
+    });
+    EXPECT_EQ(wait_for_child(child), 0) << "see above";
 }
