@@ -5,10 +5,9 @@
 #include "tests/support/hand_session.h"
 #include "tests/support/log_lines.h"
 #include "tests/support/mgmt_owners.h"
+#include "tests/support/texts.h"
 
 namespace {
-
-using strings = std::vector<std::string>;
 
 void add(bn_binding_array *bindings, const std::string &name, const char *value, uint32_t flags = 0,
          uint32_t type = bn_type_str) {
@@ -132,48 +131,43 @@ TEST(client, foreach_counts_successful_calls) {
 
 TEST(client, change_event) {
     log_lines log;
-    const struct {
-        const char *type, *before, *after;
-        lc_status status;
-        const char *old_value, *new_value;
-    } cases[] = {
-        {"add", nullptr, "2", 0, "(null)", "2"},    {"add", "1", "2", LC_ASSERTION, nullptr, nullptr},
-        {"delete", "1", nullptr, 0, "1", ""},       {"delete", "1", "2", LC_ASSERTION, nullptr, nullptr},
-        {"modify", "1", "2", 0, "1", "2"},          {"modify", "1", nullptr, LC_ASSERTION, nullptr, nullptr},
-        {"moved", "1", "2", 0, "(null)", "(null)"}, {nullptr, "1", "2", LC_NULL, nullptr, nullptr},
-    };
-    for (const auto &change : cases) {
-        SCOPED_TRACE(change.type ? change.type : "no type");
-        bindings_owner bindings, before, after;
-        ASSERT_EQ(bn_binding_array_new(&bindings), 0);
+    // "before > after" as extracted, with "-" for a deleted node; or the status.
+    const auto extract = [](const char *type, const char *before, const char *after) {
+        bindings_owner bindings, old_values, new_values;
+        EXPECT_EQ(bn_binding_array_new(&bindings), 0);
         const std::string entry = "/mgmtd/notification/dbchange/1";
-        const std::pair<const char *, const char *> nodes[] = {{"", ""},
-                                                               {"/name", "/n"},
-                                                               {"/change_type", change.type},
-                                                               {"/prev_attribs/value", change.before},
-                                                               {"/new_attribs/value", change.after},
-                                                               {"", "again"}};
+        const char *const nodes[][2] = {{"", ""},
+                                        {"/name", "/n"},
+                                        {"/change_type", type},
+                                        {"/prev_attribs/value", before},
+                                        {"/new_attribs/value", after},
+                                        {"", "again"}};
         for (const auto &[name, value] : nodes)
             if (value)
                 add(bindings, entry + name, value);
-        ASSERT_EQ(mdc_event_config_change_notif_extract(bindings, &before, &after), change.status);
-        ASSERT_EQ(before.pointer == nullptr, change.status != 0);
-        ASSERT_EQ(after.pointer == nullptr, change.status != 0);
-        if (change.status)
-            continue;
-        EXPECT_EQ(value_of(before, "/n"), change.old_value);
-        EXPECT_EQ(value_of(after, "/n"), change.new_value);
-        EXPECT_LE(bn_binding_array_length_quick(after), 1u);
-        const bn_binding *gone = nullptr;
-        uint32_t type = 0, flags = 0;
-        ASSERT_EQ(bn_binding_array_get_binding_by_name(after, "/n", &gone), 0);
-        if (change.before && !change.after) {
-            ASSERT_EQ(bn_binding_get_type(gone, bn_attrib_value, &type, &flags), 0);
-            EXPECT_EQ(type & BN_TYPE_MASK, uint32_t{bn_type_str});
-            EXPECT_EQ(flags, bn_flag_deleted | bn_flag_absent);
-        }
-        EXPECT_EQ(mdc_event_config_change_notif_extract(bindings, nullptr, &after), 0);
-    }
+        const lc_status status = mdc_event_config_change_notif_extract(bindings, &old_values, &new_values);
+        EXPECT_EQ(!old_values.pointer && !new_values.pointer, status != 0);
+        if (status != 0)
+            return std::to_string(status);
+        EXPECT_LE(bn_binding_array_length_quick(new_values), 1u);
+        const bn_binding *changed = nullptr;
+        uint32_t type_of = bn_type_str, flags = 0;
+        EXPECT_EQ(bn_binding_array_get_binding_by_name(new_values, "/n", &changed), 0);
+        EXPECT_EQ(changed ? bn_binding_get_type(changed, bn_attrib_value, &type_of, &flags) : 0, 0);
+        EXPECT_EQ(type_of & BN_TYPE_MASK, uint32_t{bn_type_str});
+        const std::string values = value_of(old_values, "/n") + " > " + value_of(new_values, "/n");
+        EXPECT_EQ(mdc_event_config_change_notif_extract(bindings, nullptr, &new_values), 0);
+        return values + (flags == (bn_flag_deleted | bn_flag_absent) ? "-" : "");
+    };
+    const std::string refused = std::to_string(LC_ASSERTION);
+    EXPECT_EQ(extract("add", nullptr, "2"), "(null) > 2");
+    EXPECT_EQ(extract("add", "1", "2"), refused);
+    EXPECT_EQ(extract("delete", "1", nullptr), "1 > -");
+    EXPECT_EQ(extract("delete", "1", "2"), refused);
+    EXPECT_EQ(extract("modify", "1", "2"), "1 > 2");
+    EXPECT_EQ(extract("modify", "1", nullptr), refused);
+    EXPECT_EQ(extract("moved", "1", "2"), "(null) > (null)");
+    EXPECT_EQ(extract(nullptr, "1", "2"), std::to_string(LC_NULL));
     EXPECT_TRUE(log.say("Unexpected change type moved under binding /mgmtd/notification/dbchange/1"));
 }
 
@@ -298,13 +292,10 @@ TEST(client, monitoring_answers) {
     ASSERT_EQ(several.dispatch(), 0);
     EXPECT_EQ(several.answer(), (strings{deep + " 1068", "/one 1071"}));
     const std::string lines = log.take();
-    for (const char *line : {
-             "Ignoring a registered name of 65 parts, the limit is 64",
-             "Registered names have more than 4096 parts in all, ignoring /late and what follows",
-             "Unexpected query subop 0; ignoring request for binding /odd",
-         })
-        EXPECT_NE(lines.find(line), std::string::npos) << line;
-    EXPECT_EQ(lines.find("/later"), std::string::npos);
+    EXPECT_TRUE(contains(lines, "Ignoring a registered name of 65 parts, the limit is 64",
+                         "Registered names have more than 4096 parts in all, ignoring /late and what follows",
+                         "Unexpected query subop 0; ignoring request for binding /odd"));
+    EXPECT_TRUE(lacks(lines, "/later"));
 
     const std::pair<lc_status, uint32_t> masks[] = {
         {LC_NULL, 0}, {LC_ASSERTION, bn_type_str}, {LC_BAD_TYPE, bn_type_uint32}};
@@ -343,10 +334,9 @@ TEST(client, log_levels_at_start) {
     add(peer.held, OVERRIDE, "false", 0, bn_type_bool);
     add(peer.held, CLASS, "notice");
     ASSERT_EQ(qv_init_log_level(peer.client), 0);
-    const std::string lines = log.take();
-    for (const char *line :
-         {"system log level to 'warning'", "daemon log level to 'info'", "override log level to \"notice\""})
-        EXPECT_NE(lines.find(std::string("Synchronized ") + line), std::string::npos) << lines;
+    EXPECT_TRUE(contains(log.take(), "Synchronized system log level to 'warning'",
+                         "Synchronized daemon log level to 'info'",
+                         "Synchronized override log level to \"notice\""));
     EXPECT_EQ(lc_log_get_daemon_log_level(), LC_LOG_INFO);
     server odd;
     add(odd.held, PROCESS, "loud");
@@ -360,43 +350,36 @@ TEST(client, log_levels_at_start) {
 TEST(client, log_levels_on_change) {
     constexpr const char *deleted = nullptr;
     constexpr int32_t info = LC_LOG_INFO, debug = LC_LOG_DEBUG, warning = LC_LOG_WARNING;
-    const struct {
-        std::vector<std::pair<std::string, const char *>> changes;
-        int32_t daemon_level, level;
-        const char *line;
-        lc_status status = LC_OK;
-    } cases[] = {
-        {{{"/qv/wccpd/other", "x"}}, debug, warning, ""},
-        {{{PROCESS, "info"}, {SYSTEM, "err"}}, info, warning, "Process log_level='info'"},
-        {{{PROCESS, "loud"}, {SYSTEM, "err"}}, debug, warning, "", LC_BAD_TYPE},
-        {{{PROCESS, ""}, {SYSTEM, "info"}, {OVERRIDE, "false"}}, -1, info, "level is set to \"info\""},
-        {{{PROCESS, deleted}, {SYSTEM, "info"}}, -1, info, "level is set to \"info\""},
-        {{{SYSTEM, ""}, {CLASS, "debug"}}, debug, debug, "override is enabled, log level is \"debug\""},
-        {{{SYSTEM, deleted}, {OVERRIDE, "false"}}, debug, warning, "override is disabled"},
-        {{{OVERRIDE, "false"}, {CLASS, "debug"}}, debug, warning, "system-wide override is disabled"},
-        {{{CLASS, "info"}}, debug, info, "per-class local0 override is enabled, log level is \"info\""},
-        {{{CLASS, ""}}, debug, warning, "per-class local0 override is disabled"},
-    };
     log_lines log;
     EXPECT_EQ(qv_handle_log_level_change(nullptr), 0);
-    for (const auto &each : cases) {
-        SCOPED_TRACE(testing::PrintToString(each.changes[0]));
+    const auto check = [&](const std::vector<std::pair<std::string, const char *>> &changes,
+                           int32_t daemon_level, int32_t level, const char *line, lc_status status = LC_OK) {
+        SCOPED_TRACE(testing::PrintToString(changes[0]));
         ASSERT_EQ(lc_log_set_daemon_log_level(LC_LOG_DEBUG), 0);
         ASSERT_EQ(lc_log_set_max_log_level("warning"), 0);
         ASSERT_EQ(lc_log_enable_override_log_level(0, 0), 0);
         ASSERT_EQ(lc_log_enable_override_log_level(1, 1), 0);
         bindings_owner bindings;
         ASSERT_EQ(bn_binding_array_new(&bindings), 0);
-        for (const auto &[name, value] : each.changes)
+        for (const auto &[name, value] : changes)
             add(bindings, name, value, value ? 0 : bn_flag_deleted | bn_flag_absent,
                 name == OVERRIDE ? bn_type_bool : bn_type_str);
-        EXPECT_EQ(qv_handle_log_level_change(bindings), each.status);
-        EXPECT_EQ(lc_log_get_daemon_log_level(), each.daemon_level);
-        EXPECT_EQ(G_log_level, each.level);
+        EXPECT_EQ(qv_handle_log_level_change(bindings), status);
+        EXPECT_EQ(lc_log_get_daemon_log_level(), daemon_level);
+        EXPECT_EQ(G_log_level, level);
         const std::string lines = log.take();
-        EXPECT_TRUE(lines.find(each.line) != std::string::npos && lines.find(".ERR]") == std::string::npos)
-            << lines;
-    }
+        EXPECT_TRUE(contains(lines, line) && lacks(lines, ".ERR]")) << lines;
+    };
+    check({{"/qv/wccpd/other", "x"}}, debug, warning, "");
+    check({{PROCESS, "info"}, {SYSTEM, "err"}}, info, warning, "Process log_level='info'");
+    check({{PROCESS, "loud"}, {SYSTEM, "err"}}, debug, warning, "", LC_BAD_TYPE);
+    check({{PROCESS, ""}, {SYSTEM, "info"}, {OVERRIDE, "false"}}, -1, info, "level is set to \"info\"");
+    check({{PROCESS, deleted}, {SYSTEM, "info"}}, -1, info, "level is set to \"info\"");
+    check({{SYSTEM, ""}, {CLASS, "debug"}}, debug, debug, "override is enabled, log level is \"debug\"");
+    check({{SYSTEM, deleted}, {OVERRIDE, "false"}}, debug, warning, "override is disabled");
+    check({{OVERRIDE, "false"}, {CLASS, "debug"}}, debug, warning, "system-wide override is disabled");
+    check({{CLASS, "info"}}, debug, info, "per-class local0 override is enabled, log level is \"info\"");
+    check({{CLASS, ""}}, debug, warning, "per-class local0 override is disabled");
     EXPECT_EQ(lc_log_set_daemon_log_level(LC_LOG_DEBUG), 0);
     EXPECT_EQ(qv_handle_time_zone_change("/other"), LC_NOT_FOUND);
     setenv("TZ", "ABC-5", 1);
