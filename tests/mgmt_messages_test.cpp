@@ -368,23 +368,7 @@ struct MessageSession : testing::Test {
     bool receive(uint16_t type, const wire &body) { return with.deliver(frame_bytes(2, type, body)); }
 };
 
-TEST_F(MessageSession, EachTypeReachesItsCallback) {
-    bn_set_global_callback_query_request_msg(with.instance, note, this);
-    bn_set_global_callback_query_response_msg(with.instance, note, this);
-    bn_set_global_callback_set_request_msg(with.instance, note, this);
-    bn_set_global_callback_set_response_msg(with.instance, note, this);
-    bn_set_global_callback_action_request_msg(with.instance, note, this);
-    bn_set_global_callback_action_response_msg(with.instance, note, this);
-    bn_set_global_callback_event_request_msg(with.instance, note, this);
-    bn_set_global_callback_event_response_msg(with.instance, note, this);
-    ASSERT_TRUE(with.open());
-    for (uint16_t type = 1; type <= 8; type++)
-        EXPECT_TRUE(receive(type, message(type))) << type;
-    EXPECT_EQ(calls, "1 2 3 4 5 6 7 8 ");
-    EXPECT_EQ(log.count("Error code"), 0);
-}
-
-TEST_F(MessageSession, WhatIsNotHandledIsLogged) {
+TEST_F(MessageSession, EachTypeReachesItsCallbackOrIsLogged) {
     ASSERT_TRUE(with.open());
     bn_set_global_callback_query_request_msg(with.instance, note, this); // too late for this session
     const auto expect_line = [&](uint16_t type, const wire &body, const std::string &line) {
@@ -409,16 +393,26 @@ TEST_F(MessageSession, WhatIsNotHandledIsLogged) {
                 "proto bnode: no event response callback: code = 0 msg = message");
     expect_line(2, wire("\x00\x03", 2) + message(2).substr(2), "service 3 not open: 2");
     bn_set_session_callback_query_request_msg(with.session, note, this);
-    for (const uint16_t frame_type : std::initializer_list<uint16_t>{1, 3})
-        EXPECT_TRUE(receive(frame_type, message(1)));
-    EXPECT_EQ(calls, "1 1 ");
+    bn_set_session_callback_query_response_msg(with.session, note, this);
+    bn_set_session_callback_set_request_msg(with.session, note, this);
+    bn_set_session_callback_set_response_msg(with.session, note, this);
+    bn_set_session_callback_action_request_msg(with.session, note, this);
+    bn_set_session_callback_action_response_msg(with.session, note, this);
+    bn_set_session_callback_event_request_msg(with.session, note, this);
+    bn_set_session_callback_event_response_msg(with.session, note, this);
+    EXPECT_TRUE(receive(3, message(1)));
+    for (type = 1; type <= 8; type++)
+        EXPECT_TRUE(receive(type, message(type))) << type;
+    EXPECT_EQ(calls, "1 1 2 3 4 5 6 7 8 ");
+    EXPECT_EQ(log.count("Error code"), 0);
     EXPECT_FALSE(receive(7, request_frame(7, pack_parts("", 0, 9, wire("cut")))));
     EXPECT_GE(log.count("Error code 14011"), 1);
     EXPECT_EQ(log.count("session 1: closing after error condition"), 1);
     EXPECT_EQ(log.count("messsage"), 0);
 }
 
-// The peer gets a code and a message, also if the queue is completely full.
+// The peer gets a code and a message, also if the queue is completely full. That frames are dropped is logged
+// once each time.
 TEST_F(MessageSession, AResponseThatDoesNotFitIsReplaced) {
     ASSERT_TRUE(with.open());
     const auto answer = [&](size_t bytes) {
@@ -437,20 +431,33 @@ TEST_F(MessageSession, AResponseThatDoesNotFitIsReplaced) {
     expect_refusal(with.provider.take_frame(), "The answer is larger than a message: ask for less");
     EXPECT_EQ(log.count("session 1: message of 167773"), 1);
 
-    size_t waiting = 0;
-    for (const uint32_t size : {65536u, 1u})
-        while (gcl_session_send_frame_components(with.session, 2, 7, size, wire(size, 'q').data()) == 0)
-            waiting++;
-    answer(1);
-    for (size_t i = 0; i < waiting; i++) {
-        wire frame;
-        while ((frame = with.provider.take_frame(0)).empty())
-            (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_WRITABLE, with.session, nullptr);
-        ASSERT_EQ(frame.back(), 'q');
+    uint32_t sequence = 2000004;
+    for (int filling = 0; filling < 2; filling++) {
+        log.clear();
+        uint32_t waiting = 0, queued_bytes = 0;
+        for (const uint32_t size : {65536u, 1u})
+            while (gcl_session_send_frame_components(with.session, 2, 7, size, wire(size, 'q').data()) ==
+                   LC_OK) {
+                waiting++;
+                queued_bytes += size + 32;
+            }
+        EXPECT_EQ(gcl_session_send_frame_components(with.session, 2, 7, 1, "q"), LC_CANCELLED);
+        EXPECT_NEAR(queued_bytes, GCL_QUEUE_MAX_BYTES + 500000.0, 500000); // some are in the socket
+        answer(1);
+        EXPECT_EQ(log.count("output queue is full"), 1);
+        for (uint32_t i = 0; i < waiting; i++) {
+            wire frame;
+            while ((frame = with.provider.take_frame(0)).empty())
+                (void)gcl_session_fd_read_write_timeout_activity(0, FDIC_WRITABLE, with.session, nullptr);
+            ASSERT_EQ(frame.back(), 'q');
+            ASSERT_EQ(number_at(frame, 20), sequence++);
+        }
+        expect_refusal(with.provider.take_frame(),
+                       "The session's output queue is full: ask for less, or try again later");
+        sequence++;
+        EXPECT_EQ(log.count("4 frames were dropped"), 1);
+        EXPECT_EQ(log.count("Error code"), 0);
     }
-    expect_refusal(with.provider.take_frame(),
-                   "The session's output queue is full: ask for less, or try again later");
-    EXPECT_EQ(log.count("Error code"), 0);
 }
 
 TEST_F(MessageSession, SentMessagesAreNumberedAndLogged) {
