@@ -75,12 +75,8 @@ const struct type_case {
 std::string packed(const wire_bytes &all) {
     return {all.bytes.begin(), all.bytes.end()};
 }
-lc_status set_text(bn_attrib *attrib, uint32_t type, const std::string &in) {
-    return bn_attrib_set_str(attrib, 1, type & BN_TYPE_MASK, type & ~BN_TYPE_MASK, in.c_str());
-}
-std::string value_of(const bn_attrib *attrib) {
-    return text_of(
-        [&](char **out) { return bn_attrib_get_str(attrib, nullptr, attrib->type, nullptr, out); });
+std::string value_of(const bn_attrib *from) {
+    return text_of([&](char **out) { return bn_attrib_get_str(from, nullptr, from->type, nullptr, out); });
 }
 // From a buffer of exactly these bytes, so that the sanitizer sees a read past them.
 lc_status read_bytes(const std::string &bytes, bn_attrib **out) {
@@ -110,15 +106,16 @@ void expect_bytes(const bn_attrib *attrib, const std::string &golden) {
 }
 TEST(Values, TextsAndBytes) {
     for (const type_case &c : type_cases) {
+        const uint32_t type = c.type & BN_TYPE_MASK, flags = c.type & ~BN_TYPE_MASK;
         for (const std::string &row : c.texts) {
             SCOPED_TRACE(std::to_string(c.type) + " " + row);
             const size_t arrow = row.find(" -> ");
             attrib_owner attrib;
             ASSERT_EQ(bn_attrib_new(&attrib), LC_OK);
-            ASSERT_EQ(set_text(attrib, c.type, row.substr(0, arrow)), LC_OK);
+            ASSERT_EQ(bn_attrib_set_str(attrib, 1, type, flags, row.substr(0, arrow).c_str()), LC_OK);
             EXPECT_EQ(value_of(attrib), arrow == std::string::npos ? row : row.substr(arrow + 4));
             wire_bytes bytes;
-            bytes.u32(c.kind).u32(1).u32(c.type & BN_TYPE_MASK).u32(c.type & ~BN_TYPE_MASK);
+            bytes.u32(c.kind).u32(1).u32(type).u32(flags);
             if (c.bytes && &row == &c.texts[0])
                 expect_bytes(attrib, packed(bytes.hex(c.bytes)));
         }
@@ -129,11 +126,9 @@ TEST(Values, TextsAndBytes) {
             binding_owner binding;
             uint32_t word = 0;
             ASSERT_EQ(bn_attrib_new_uint32(&attrib, 1, 0, 77), LC_OK);
-            EXPECT_EQ(set_text(attrib, c.type, in), LC_BAD_TYPE);
+            EXPECT_EQ(bn_attrib_set_str(attrib, 1, type, flags, in.c_str()), LC_BAD_TYPE);
             EXPECT_EQ(value_of(attrib), "77"); // as before
-            EXPECT_EQ(bn_binding_new_str_autoinval(&binding, "/a", 1, c.type & BN_TYPE_MASK,
-                                                   c.type & ~BN_TYPE_MASK, in.c_str()),
-                      LC_OK);
+            EXPECT_EQ(bn_binding_new_str_autoinval(&binding, "/a", 1, type, flags, in.c_str()), LC_OK);
             EXPECT_EQ(text_of([&](char **out) { return bn_binding_get_str(binding, 1, 0, &word, out); }), "");
             EXPECT_EQ(word, c.type | bn_flag_invalid);
             const std::string lines = log.take(); // only those with the bytes of bad UTF-8
@@ -157,26 +152,25 @@ TEST(Values, RefusedTypesAndIds) {
 }
 
 TEST(Wire, FalseFieldsAreRefused) {
-    static const std::pair<const char *, lc_status> cases[] = {
-        {"00000001 00000000 00000005 00000000 00000004 00000001", LC_ASSERTION}, // ids
-        {"00000001 00000083 00000005 00000000 00000004 00000001", LC_ASSERTION},
-        {"00000001 00000001 00000000 00000000 00000004 00000001", LC_ASSERTION}, // types
-        {"00000001 00000001 00000087 00000000 00000004 00000001", LC_ASSERTION},
-        {"00000001 00000001 80000005 00000000 00000004 00000001", LC_ASSERTION},
-        {"00000001 00000001 0000005b 00000000 00000004 00000001", LC_NULL},
-        {"00000001 00000001 0000000b 00000000 00000004 00000001", LC_NULL},
-        {"00000004 00000001 00000005 00000000 00000004 00000001", LC_GENERIC}, // another family's kind
-        {"00000001 00000001 00000005 00000000 00000002 00000001", LC_GENERIC}, // sizes
-        {"00000001 00000001 00000005 00000000 00000000 00000001", LC_GENERIC},
-        {"00000001 00000001 00000005 00000000 ffffffff 00000001", LC_GENERIC},
-        {"00000004 00000001 00000065 00000000 ffffffff 616263", LC_NO_BUFFER_SPACE}, // lengths
-        {"00000004 00000001 00000067 00000000 00000004 616263", LC_NO_BUFFER_SPACE},
-        {"00000004 00000001 00000066 00000000 00000002 61ff", LC_OK}, // bad UTF-8 stays plain text
-    };
     attrib_owner attrib;
     buffer_owner buffer;
-    for (const auto &[bytes, status] : cases)
+    const auto check = [&](const char *bytes, lc_status status) {
         EXPECT_EQ(read_bytes(packed(hex(bytes)), &attrib), status) << bytes;
+    };
+    check("00000001 00000000 00000005 00000000 00000004 00000001", LC_ASSERTION); // ids
+    check("00000001 00000083 00000005 00000000 00000004 00000001", LC_ASSERTION);
+    check("00000001 00000001 00000000 00000000 00000004 00000001", LC_ASSERTION); // types
+    check("00000001 00000001 00000087 00000000 00000004 00000001", LC_ASSERTION);
+    check("00000001 00000001 80000005 00000000 00000004 00000001", LC_ASSERTION);
+    check("00000001 00000001 0000005b 00000000 00000004 00000001", LC_NULL);
+    check("00000001 00000001 0000000b 00000000 00000004 00000001", LC_NULL);
+    check("00000004 00000001 00000005 00000000 00000004 00000001", LC_GENERIC); // another family's kind
+    check("00000001 00000001 00000005 00000000 00000002 00000001", LC_GENERIC); // sizes
+    check("00000001 00000001 00000005 00000000 00000000 00000001", LC_GENERIC);
+    check("00000001 00000001 00000005 00000000 ffffffff 00000001", LC_GENERIC);
+    check("00000004 00000001 00000065 00000000 ffffffff 616263", LC_NO_BUFFER_SPACE); // lengths
+    check("00000004 00000001 00000067 00000000 00000004 616263", LC_NO_BUFFER_SPACE);
+    check("00000004 00000001 00000066 00000000 00000002 61ff", LC_OK); // bad UTF-8 stays plain text
     EXPECT_EQ(text(attrib->value.string), "a\xff");
     EXPECT_EQ(attrib->value.string->utf8, 0);
     log_lines log;
@@ -192,30 +186,27 @@ TEST(Wire, FalseFieldsAreRefused) {
 // --- Attributes and bindings
 
 TEST(Attributes, Order) {
-    static const std::tuple<uint32_t, const char *, const char *> pairs[] = {
-        // the lower one first
-        {bn_type_int32, "-1", "1"},
-        {bn_type_uint32, "1", "4294967295"},
-        {bn_type_float64, "-1.5", "0.5"},
-        {bn_type_str, "10", "9"},
-        {bn_type_binary, "ab", "abc"},
-        {bn_type_ipaddr, "200.0.0.1", "::1"},
-        {bn_type_ipv4addr, "9.9.9.9", "10.0.0.2"},
-        {bn_type_ipprefix, "10.0.0.0/8", "10.0.0.0/16"},
-    };
+    attrib_owner left, right, number;
+    ASSERT_EQ(bn_attrib_new_uint32(&number, 1, 0, 1), LC_OK);
     const auto compare = [](const bn_attrib *a, const bn_attrib *b) {
         int order = 99;
         EXPECT_EQ(bn_attrib_compare(a, b, &order), LC_OK);
         return order;
     };
-    attrib_owner left, right, number;
-    ASSERT_EQ(bn_attrib_new_uint32(&number, 1, 0, 1), LC_OK);
-    for (const auto &[type, lower, higher] : pairs) {
+    const auto check = [&](uint32_t type, const char *lower, const char *higher) {
         ASSERT_EQ(bn_attrib_new_str(&left, 1, type, 0, lower), LC_OK);
         ASSERT_EQ(bn_attrib_new_str(&right, 1, type, 0, higher), LC_OK);
         EXPECT_TRUE(compare(left, right) < 0 && compare(right, left) > 0) << type;
         EXPECT_EQ(compare(left, number), type == bn_type_uint32 ? 0 : static_cast<int>(type) - 5);
-    }
+    };
+    check(bn_type_int32, "-1", "1");
+    check(bn_type_uint32, "1", "4294967295");
+    check(bn_type_float64, "-1.5", "0.5");
+    check(bn_type_str, "10", "9");
+    check(bn_type_binary, "ab", "abc");
+    check(bn_type_ipaddr, "200.0.0.1", "::1");
+    check(bn_type_ipv4addr, "9.9.9.9", "10.0.0.2");
+    check(bn_type_ipprefix, "10.0.0.0/8", "10.0.0.0/16");
     EXPECT_GT(compare(nullptr, number), 0);
 }
 
@@ -252,21 +243,19 @@ TEST(Bindings, TypedOperations) {
 }
 
 TEST(Bindings, NamesAndParts) {
-    const std::tuple<const char *, int, strings> cases[] = {
-        {"a/b", 0, {"a", "b"}},
-        {"/a//b", 1, {"a", "", "b"}},
-        {"/a/", 1, {"a", ""}},
-        {"/", 1, {}},
-        {"", 0, {}},
-        {"a\\b", 0, {"a\\b"}},
-        {"/a\\/b/c", 1, {"a/b", "c"}},
-    };
     tokens_owner parts;
-    for (const auto &[name, expected, list] : cases) { // and back, in the test of the matchers
-        int absolute = -1;
+    const auto check = [&](const char *name, int expected, const strings &list) {
+        int absolute = -1; // and back, in the test of the matchers
         ASSERT_EQ(bn_binding_name_to_parts(name, &parts, &absolute), LC_OK);
         EXPECT_TRUE(absolute == expected && list_of(parts) == list) << name;
-    }
+    };
+    check("a/b", 0, {"a", "b"});
+    check("/a//b", 1, {"a", "", "b"});
+    check("/a/", 1, {"a", ""});
+    check("/", 1, {});
+    check("", 0, {});
+    check("a\\b", 0, {"a\\b"});
+    check("/a\\/b/c", 1, {"a/b", "c"});
     binding_owner binding, copy;
     ASSERT_EQ(bn_binding_new_named(&binding, "/file/\\/var\\/log/all"), LC_OK);
     ASSERT_EQ(bn_binding_name_to_parts("/file/\\/var\\/log/all", &binding->parts, nullptr), LC_OK);
@@ -279,27 +268,22 @@ TEST(Bindings, NamesAndParts) {
 }
 
 TEST(Bindings, Patterns) {
-    static const std::array<const char *, 3> cases[] = {
-        // a pattern, a match, none; null: not given
-        {"/config/*", "/config/51", "/config/51/weight"},
-        {"/logging/**", "/logging/a", "/logging"},
-        {"/logging/**", "/logging/a/b/c", nullptr},
-        {"/a/**/b", "/a/x/y", "/a/x"},
-        {"/a/b", "/a/b", "a/b"},
-        {"a/b", "a/b", "/a/b"},
-        {"/a/bc", nullptr, "/a/b"},
-        {"/a/*/c", "/a/x\\/y/c", nullptr},
-        {"/a\\/b/*", "/a\\/b/c", nullptr},
-        {"/a/*", "/a/", nullptr},
-        {"/", "/", "/a"},
-        {"/*", nullptr, "/"},
-        {"/a//b", "/a//b", "/a/bc"},
-        {"/a\\b", "/a\\b", "/a/b"},
-    };
-    for (const auto &[pattern, matching, other] : cases) {
+    // A pattern, a match, none; null: not given.
+    const auto check = [](const char *pattern, const char *matching, const char *other) {
         EXPECT_TRUE(!matching || bn_binding_name_pattern_match(matching, pattern)) << pattern;
         EXPECT_FALSE(other && bn_binding_name_pattern_match(other, pattern)) << pattern;
-    }
+    };
+    check("/config/*", "/config/51", "/config/51/weight");
+    check("/logging/**", "/logging/a", "/logging");
+    check("/logging/**", "/logging/a/b/c", nullptr);
+    check("/a/**/b", "/a/x/y", "/a/x");
+    check("/a/b", "/a/b", "a/b");
+    check("/a/bc", nullptr, "/a/b");
+    check("/a/*/c", "/a/x\\/y/c", nullptr);
+    check("/a\\/b/*", "/a\\/b/c", nullptr);
+    check("/a/*", "/a/", nullptr);
+    check("/*", nullptr, "/");
+    check("/a//b", "/a//b", "/a/bc");
 }
 
 // All short patterns with all short names: matching the text and matching the parts agree, a name is sent

@@ -49,7 +49,6 @@ TEST_F(Mgmtd, ARefusedStepLeavesEverythingAsItWas) {
     refuse(LC_NOT_FOUND, {bn_set_modify, GROUP + "/wait", "1"});
     refuse(LC_NOT_FOUND, {bn_set_modify, GROUPS + "52/weight", "1"});
     refuse(LC_BAD_PATH, {bn_set_modify, "weight", "1"});
-    refuse(LC_ASSERTION, {bn_set_create, GROUP + "/router/3/ipaddr", "10.0.0.3"});
     refuse(LC_ASSERTION, {bn_set_create, GROUP + "/router/2", ""}); // no address
     refuse(LC_ASSERTION, {bn_set_delete, GROUP + "/router/1/ipaddr", "", bn_type_none});
     refuse(LC_ASSERTION, {bn_set_delete, POLICY, "", bn_type_none}); // it is in use

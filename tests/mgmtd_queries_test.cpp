@@ -161,12 +161,7 @@ TEST_F(Queries, ThatNobodyAnswers) {
     open(5, "tunneld-9");
     follow(1, {EVENT_CONFIG_CHANGE});
     follow(5, {EVENT_CONFIG_CHANGE});
-    bn_request_msg *both = nullptr;
-    ASSERT_EQ(bn_query_request_msg_create(&both, 0, nullptr), LC_OK);
-    for (const char *name : {NODE_PLANE_STATE, "/qv/wccpd/wccp/srv_grp"})
-        ASSERT_EQ(bn_query_request_msg_append_str(both, bn_query_iterate, bn_qf_subtree, name, nullptr),
-                  LC_OK);
-    EXPECT_TRUE(give(3, both));
+    query(3, NODE_PLANE_STATE, bn_query_iterate, bn_qf_subtree, "/qv/wccpd/wccp/srv_grp");
     (void)answer_last(1, {group(7), group(51)});
     (void)answer_last(1, {{STATE + "/7/oper", {bn_type_str, "INIT"}}});
     clear();

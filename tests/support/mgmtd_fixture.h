@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <fstream>
 #include <initializer_list>
+#include <map>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -41,6 +42,7 @@ struct Mgmtd : testing::Test {
     server daemon;
     int64_t now = 1000;
     std::deque<sent_message> sent;
+    std::map<uint32_t, strings> told; // the names of all events, by the peer that got them
     std::string said;
     uint32_t asker = 3; // sends the set requests
     char file[32] = "/tmp/mgmtd-test-XXXXXX";
@@ -60,6 +62,8 @@ struct Mgmtd : testing::Test {
                 ASSERT_EQ(bn_request_msg_deserialize(frame, 32, &message.request), LC_OK);
             else
                 ASSERT_EQ(bn_response_msg_deserialize(frame, 32, &message.response), LC_OK);
+            if (mtype == bn_msg_event)
+                told[peer_id].emplace_back(ts_str(message.request->text));
         };
         tree_refresh(&daemon.tree);
         server_peer_opened(&daemon, 1, "wccpd-7"); // the working session
@@ -115,10 +119,12 @@ struct Mgmtd : testing::Test {
         (void)server_tick(&daemon);
         return changes();
     }
-    void query(uint32_t peer_id, const std::string &name, uint32_t subop, uint32_t flags = 0) {
+    void query(uint32_t peer_id, const std::string &name, uint32_t subop, uint32_t flags = 0,
+               const std::string &second_name = "") {
         bn_request_msg *msg = nullptr;
         ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), LC_OK);
-        ASSERT_EQ(bn_query_request_msg_append_str(msg, subop, flags, name.c_str(), nullptr), LC_OK);
+        for (const std::string &each : second_name.empty() ? strings{name} : strings{name, second_name})
+            ASSERT_EQ(bn_query_request_msg_append_str(msg, subop, flags, each.c_str(), nullptr), LC_OK);
         EXPECT_TRUE(give(peer_id, msg));
     }
     struct set_node {
