@@ -237,8 +237,7 @@ TEST(Bindings, TypedOperations) {
     expect(bn_binding_get_uint32(binding, 1, nullptr, &value), LC_ASSERTION, "a int8 attribute as a uint32");
     expect(bn_binding_get_uint32(binding, 129, nullptr, &value), LC_NOT_FOUND, "Error code 14004");
     expect(bn_binding_get_type(bare, 1, &type, nullptr), LC_NULL, "Unexpected NULL");
-    expect(bn_binding_get_str(bare, 1, 0, nullptr, &given), LC_NULL,
-           "Can't get attribute value of binding /c");
+    expect(bn_binding_get_str(bare, 1, 0, nullptr, &given), LC_NULL, "attribute value of binding /c");
     expect(bn_binding_get_str(binding, 1, bn_type_str, nullptr, &given), LC_ASSERTION, "Error code");
 }
 
@@ -259,10 +258,8 @@ TEST(Bindings, NamesAndParts) {
     binding_owner binding, copy;
     ASSERT_EQ(bn_binding_new_named(&binding, "/file/\\/var\\/log/all"), LC_OK);
     ASSERT_EQ(bn_binding_name_to_parts("/file/\\/var\\/log/all", &binding->parts, nullptr), LC_OK);
-    const tstr_array *kept = nullptr;
     ASSERT_EQ(bn_binding_dup(binding, &copy), LC_OK);
-    ASSERT_EQ(bn_binding_get_name_parts_const(copy, &kept, nullptr), LC_OK);
-    EXPECT_EQ(list_of(kept), (strings{"file", "/var/log", "all"}));
+    EXPECT_EQ(list_of(copy->parts), (strings{"file", "/var/log", "all"}));
     ASSERT_EQ(bn_binding_set_name(copy, "relative"), LC_OK);
     EXPECT_EQ(bn_binding_get_name_parts(copy, &parts), LC_ASSERTION); // not the earlier ones
 }

@@ -220,13 +220,13 @@ TEST_F(OutOfRouters, ADrainedGroupAnnouncesWeightZeroAndLeavesOnceItIsEmpty) {
     EXPECT_EQ(tick(LEFT_KEEP_MS - 1), "");
     EXPECT_EQ(tick(1), "51/weight=8>10");
     EXPECT_TRUE(contains(content(), "weight = 10"));
-    const char *const bad[][3] = {{"group", "256", "group is not a number between 0 and 255"},
-                                  {"group", "7", "There is no group 7"},
-                                  {"seconds", "86401", "seconds is not a number between 0 and 86400"}};
-    for (const auto &[field, number, refused] : bad) {
+    const auto refuse = [&](const char *field, const char *number, const char *reason) {
         EXPECT_EQ(begin(field, number), "");
-        EXPECT_EQ(message(), refused);
-    }
+        EXPECT_EQ(message(), reason);
+    };
+    refuse("group", "256", "group is not a number between 0 and 255");
+    refuse("group", "7", "There is no group 7");
+    refuse("seconds", "86401", "seconds is not a number between 0 and 86400");
     (void)act(ACTION_DRAIN);
     EXPECT_EQ(set("-51"), 0u);
     EXPECT_TRUE(daemon.drains.empty());
