@@ -84,7 +84,7 @@ TEST(client, requests_and_their_results) {
     uint32_t code = 9, revision = 0;
     mdc *to = peer.client;
     for (const uint32_t wanted : {0u, 0x1000u, 0x2000u, 0x3000u}) {
-        const uint32_t subtree = wanted & 0x1000, self = wanted & 0x2000;
+        const int subtree = wanted & 0x1000, self = wanted & 0x2000;
         ASSERT_EQ(mdc_get_binding_children(to, nullptr, nullptr, 0, &children, self, subtree, "/a"), 0);
         EXPECT_EQ(peer.asked, "1 /a:2:" + std::to_string(wanted));
     }
