@@ -5,10 +5,9 @@
 #include "tests/support/hand_session.h"
 #include "tests/support/log_lines.h"
 #include "tests/support/mgmt_owners.h"
+#include "tests/support/texts.h"
 
 namespace {
-
-using strings = std::vector<std::string>;
 
 void add(bn_binding_array *bindings, const std::string &name, const char *value, uint32_t flags = 0,
          uint32_t type = bn_type_str) {
@@ -83,25 +82,24 @@ TEST(client, requests_and_their_results) {
 
     bindings_owner children;
     uint32_t code = 9, revision = 0;
+    mdc *to = peer.client;
     for (const uint32_t wanted : {0u, 0x1000u, 0x2000u, 0x3000u}) {
-        ASSERT_EQ(mdc_get_binding_children(peer.client, nullptr, nullptr, 0, &children, wanted & 0x2000,
-                                           wanted & 0x1000, "/a"),
-                  0);
+        const int subtree = wanted & 0x1000, self = wanted & 0x2000;
+        ASSERT_EQ(mdc_get_binding_children(to, nullptr, nullptr, 0, &children, self, subtree, "/a"), 0);
         EXPECT_EQ(peer.asked, "1 /a:2:" + std::to_string(wanted));
     }
-    ASSERT_EQ(mdc_get_binding_children_ex(peer.client, &code, nullptr, 0, &children, 0, "/a", nullptr, 3,
-                                          &revision),
+    ASSERT_EQ(mdc_get_binding_children_ex(to, &code, nullptr, 0, &children, 0, "/a", nullptr, 3, &revision),
               0);
     EXPECT_EQ(revision, 77u);
     EXPECT_EQ(bn_binding_array_length_quick(children), 1u);
 
     constexpr uint32_t type = bn_type_str;
-    EXPECT_EQ(mdc_send_action_with_bindings_str_va(peer.client, &code, nullptr, "/do", 2, "x", type, "1", "y",
-                                                   type, "2"),
-              0);
+    EXPECT_EQ(
+        mdc_send_action_with_bindings_str_va(to, &code, nullptr, "/do", 2, "x", type, "1", "y", type, "2"),
+        0);
     EXPECT_EQ(peer.asked, "5/do x:0:0 y:0:0");
     EXPECT_EQ(code, 5u);
-    ASSERT_EQ(mdc_send_action_with_bindings_str_va(peer.client, nullptr, nullptr, "/do", 0), 0);
+    ASSERT_EQ(mdc_send_action_with_bindings_str_va(to, nullptr, nullptr, "/do", 0), 0);
     EXPECT_EQ(peer.asked, "5/do");
     peer.silent = true;
     EXPECT_EQ(peer.get("/a"), "0 (null)");
@@ -112,68 +110,58 @@ TEST(client, requests_and_their_results) {
 TEST(client, foreach_counts_successful_calls) {
     bindings_owner bindings;
     ASSERT_EQ(bn_binding_array_new(&bindings), 0);
-    for (const char *name : {"/a/b/c", "/a/b/c/d", "/a/x/c", "/z/b/c", "/a/y/c"})
-        add(bindings, name, "v");
-    using notes = std::pair<std::string, uint32_t>; // what was seen, and the call that fails
+    for (const std::string name : {"/a/b/c", "/a/b/c/d", "/z/b/c", "/a/x/c", "/a/y/c"})
+        add(bindings, name, name == "/a/x/c" ? "bad" : "v");
     uint32_t count = 0;
-    notes all = {"", 99}, some = {"", 1};
-    const auto note = [](const bn_binding_array *, uint32_t index, bn_binding *, const tstring *,
+    std::string seen;
+    const auto note = [](const bn_binding_array *, uint32_t, bn_binding *, const tstring *,
                          const tstr_array *, const tstring *last, const tstring *value, void *data) {
-        auto *seen = static_cast<notes *>(data);
-        seen->first += text(last) + "=" + text(value) + ";";
-        return lc_status{index == seen->second ? LC_BAD_TYPE : LC_OK};
+        *static_cast<std::string *>(data) += text(last) + "=" + text(value) + ";";
+        return lc_status{text(value) == "bad" ? LC_BAD_TYPE : LC_OK};
     };
-    ASSERT_EQ(mdc_foreach_binding_prequeried(bindings, "/a/*/c", nullptr, note, &all, &count), 0);
-    EXPECT_TRUE(count == 3 && all.first == "c=v;c=v;c=v;") << count << all.first;
-    EXPECT_EQ(mdc_foreach_binding_prequeried(bindings, "/a/*/c", nullptr, note, &some, &count), LC_BAD_TYPE);
-    EXPECT_TRUE(count == 1 && some.first == "c=v;c=v;") << count << some.first;
-    EXPECT_EQ(mdc_foreach_binding_prequeried(nullptr, "/a", nullptr, note, &all, &count), LC_NULL);
+    EXPECT_EQ(mdc_foreach_binding_prequeried(bindings, "/a/*/c", nullptr, note, &seen, &count), LC_BAD_TYPE);
+    EXPECT_TRUE(count == 1 && seen == "c=v;c=bad;") << count << seen;
 }
 
 TEST(client, change_event) {
     log_lines log;
-    const struct {
-        const char *type, *before, *after;
-        lc_status status;
-        const char *old_value, *new_value;
-    } cases[] = {
-        {"add", nullptr, "2", 0, "(null)", "2"},    {"add", "1", "2", LC_ASSERTION, nullptr, nullptr},
-        {"delete", "1", nullptr, 0, "1", ""},       {"delete", "1", "2", LC_ASSERTION, nullptr, nullptr},
-        {"modify", "1", "2", 0, "1", "2"},          {"modify", "1", nullptr, LC_ASSERTION, nullptr, nullptr},
-        {"moved", "1", "2", 0, "(null)", "(null)"}, {nullptr, "1", "2", LC_NULL, nullptr, nullptr},
-    };
-    for (const auto &change : cases) {
-        SCOPED_TRACE(change.type ? change.type : "no type");
-        bindings_owner bindings, before, after;
-        ASSERT_EQ(bn_binding_array_new(&bindings), 0);
+    // "before > after" as extracted, with "-" for a deleted node; or the status.
+    const auto extract = [](const char *type, const char *before, const char *after) {
+        bindings_owner bindings, old_values, new_values;
+        EXPECT_EQ(bn_binding_array_new(&bindings), 0);
         const std::string entry = "/mgmtd/notification/dbchange/1";
-        const std::pair<const char *, const char *> nodes[] = {{"", ""},
-                                                               {"/name", "/n"},
-                                                               {"/change_type", change.type},
-                                                               {"/prev_attribs/value", change.before},
-                                                               {"/new_attribs/value", change.after},
-                                                               {"", "again"}};
+        const char *const nodes[][2] = {{"", ""},
+                                        {"/name", "/n"},
+                                        {"/change_type", type},
+                                        {"/prev_attribs/value", before},
+                                        {"/new_attribs/value", after},
+                                        {"", "again"}};
         for (const auto &[name, value] : nodes)
             if (value)
                 add(bindings, entry + name, value);
-        ASSERT_EQ(mdc_event_config_change_notif_extract(bindings, &before, &after), change.status);
-        ASSERT_EQ(before.pointer == nullptr, change.status != 0);
-        ASSERT_EQ(after.pointer == nullptr, change.status != 0);
-        if (change.status)
-            continue;
-        EXPECT_EQ(value_of(before, "/n"), change.old_value);
-        EXPECT_EQ(value_of(after, "/n"), change.new_value);
-        EXPECT_LE(bn_binding_array_length_quick(after), 1u);
-        const bn_binding *gone = nullptr;
-        uint32_t type = 0, flags = 0;
-        ASSERT_EQ(bn_binding_array_get_binding_by_name(after, "/n", &gone), 0);
-        if (change.before && !change.after) {
-            ASSERT_EQ(bn_binding_get_type(gone, bn_attrib_value, &type, &flags), 0);
-            EXPECT_EQ(type & BN_TYPE_MASK, uint32_t{bn_type_str});
-            EXPECT_EQ(flags, bn_flag_deleted | bn_flag_absent);
-        }
-        EXPECT_EQ(mdc_event_config_change_notif_extract(bindings, nullptr, &after), 0);
-    }
+        const lc_status status = mdc_event_config_change_notif_extract(bindings, &old_values, &new_values);
+        EXPECT_EQ(!old_values.pointer && !new_values.pointer, status != 0);
+        if (status != 0)
+            return std::to_string(status);
+        EXPECT_LE(bn_binding_array_length_quick(new_values), 1u);
+        const bn_binding *changed = nullptr;
+        uint32_t type_of = bn_type_str, flags = 0;
+        EXPECT_EQ(bn_binding_array_get_binding_by_name(new_values, "/n", &changed), 0);
+        EXPECT_EQ(changed ? bn_binding_get_type(changed, bn_attrib_value, &type_of, &flags) : 0, 0);
+        EXPECT_EQ(type_of & BN_TYPE_MASK, uint32_t{bn_type_str});
+        const std::string values = value_of(old_values, "/n") + " > " + value_of(new_values, "/n");
+        EXPECT_EQ(mdc_event_config_change_notif_extract(bindings, nullptr, &new_values), 0);
+        return values + (flags == (bn_flag_deleted | bn_flag_absent) ? "-" : "");
+    };
+    const std::string refused = std::to_string(LC_ASSERTION);
+    EXPECT_EQ(extract("add", nullptr, "2"), "(null) > 2");
+    EXPECT_EQ(extract("add", "1", "2"), refused);
+    EXPECT_EQ(extract("delete", "1", nullptr), "1 > -");
+    EXPECT_EQ(extract("delete", "1", "2"), refused);
+    EXPECT_EQ(extract("modify", "1", "2"), "1 > 2");
+    EXPECT_EQ(extract("modify", "1", nullptr), refused);
+    EXPECT_EQ(extract("moved", "1", "2"), "(null) > (null)");
+    EXPECT_EQ(extract(nullptr, "1", "2"), std::to_string(LC_NULL));
     EXPECT_TRUE(log.say("Unexpected change type moved under binding /mgmtd/notification/dbchange/1"));
 }
 
@@ -192,14 +180,13 @@ struct monitored {
         EXPECT_EQ(bn_query_request_msg_create(&request, 0, nullptr), 0);
     }
     void add_node(const std::string &name, uint32_t subop, uint32_t flags = 0, uint32_t mask_type = 0) {
-        binding_owner with_mask;
-        ASSERT_EQ(bn_binding_new_named(&with_mask, "x"), 0);
-        if (mask_type) {
-            ASSERT_EQ(bn_binding_set_str(with_mask, bn_attrib_capability_mask, mask_type, 0, "1"), 0);
-        }
-        const bn_attrib_array *mask = with_mask->attributes;
-        const char *node = name.c_str();
-        ASSERT_EQ(bn_query_request_msg_append_with_attribs(request, subop, flags, node, mask, nullptr), 0);
+        constexpr uint32_t id = bn_attrib_capability_mask;
+        binding_owner mask;
+        ASSERT_EQ(bn_binding_new_named(&mask, "x"), 0);
+        ASSERT_EQ(mask_type ? bn_binding_set_str(mask, id, mask_type, 0, "1") : 0, 0);
+        ASSERT_EQ(bn_query_request_msg_append_with_attribs(request, subop, flags, name.c_str(),
+                                                           mask->attributes, nullptr),
+                  0);
     }
     void add_registered(const strings &names) {
         for (const std::string &name : names)
@@ -243,42 +230,37 @@ struct monitored {
 TEST(client, monitoring_walk) {
     constexpr uint32_t get = bn_query_get, walk = bn_query_iterate;
     constexpr uint32_t tree = bn_qf_subtree, self = bn_qf_include_self, leaves = bn_qf_leaves_only;
-    const struct {
-        const char *name;
-        uint32_t subop, flags;
-        strings asked; // "?": asked for the children
-    } cases[] = {
-        {"/a/1/b", get, 0, {"/a/1/b"}},
-        {"/other", get, 0, {"/other"}},
-        {"/other", walk, tree | self, {}},
-        {"/a/*", walk, 0, {"?/a", "/a/1", "/a/2"}},
-        {"/a", walk, 0, {"?/a", "/a/1", "/a/2"}}, // only the direct children
-        {"/a/1", walk, 0, {"/a/1/b"}},
-        {"/a/1", walk, self, {"/a/1", "/a/1/b"}},
-        {"/a/1/c", walk, 0, {"?/a/1/c", "/a/1/c/1", "/a/1/c/2"}},
-        {"/a/1", walk, tree, {"/a/1/b", "?/a/1/c", "/a/1/c/1", "/a/1/c/2"}},
-        {"/a/1", walk, tree | self | leaves, {"/a/1/b", "?/a/1/c", "/a/1/c/1", "/a/1/c/2"}},
-        {"/a/1", walk, tree | bn_qf_walk_only, {"?/a/1/c"}},
-        {"/s", walk, 0, {"/s/x"}},
-        {"/s", walk, tree, {"/s/x", "/s/x/y"}},
-        {"/s", walk, tree | leaves, {"/s/x/y"}},
-        {"/s/x/y", walk, 0, {}},
-        {"/s/x/y", walk, self, {"/s/x/y"}},
-        {"/", walk, 0, {}}, // no registered child
-    };
-    for (const auto &row : cases) {
-        SCOPED_TRACE(std::string(row.name) + " " + std::to_string(row.flags));
+    const auto check = [](const std::string &name, uint32_t subop, uint32_t flags,
+                          const strings &asked) { // "?": asked for the children
+        SCOPED_TRACE(name + " " + std::to_string(flags));
         monitored daemon;
-        daemon.add_node(row.name, row.subop, row.flags); // the query comes before the registrations
+        daemon.add_node(name, subop, flags); // the query comes before the registrations
         daemon.add_registered({"/a/*", "/a/*/b", "/a/*/c/*", "/s/x", "/s/x", "/s/x/y"});
         ASSERT_EQ(daemon.dispatch(), 0);
-        EXPECT_EQ(daemon.asked, row.asked);
+        EXPECT_EQ(daemon.asked, asked);
         strings answered;
-        for (const std::string &name : row.asked)
-            if (name[0] != '?')
-                answered.push_back(name + " 1000");
+        for (const std::string &each : asked)
+            if (each[0] != '?')
+                answered.push_back(each + " 1000");
         EXPECT_EQ(daemon.answer(), answered);
-    }
+    };
+    check("/a/1/b", get, 0, {"/a/1/b"});
+    check("/other", get, 0, {"/other"});
+    check("/other", walk, tree | self, {});
+    check("/a/*", walk, 0, {"?/a", "/a/1", "/a/2"});
+    check("/a", walk, 0, {"?/a", "/a/1", "/a/2"}); // only the direct children
+    check("/a/1", walk, 0, {"/a/1/b"});
+    check("/a/1", walk, self, {"/a/1", "/a/1/b"});
+    check("/a/1/c", walk, 0, {"?/a/1/c", "/a/1/c/1", "/a/1/c/2"});
+    check("/a/1", walk, tree, {"/a/1/b", "?/a/1/c", "/a/1/c/1", "/a/1/c/2"});
+    check("/a/1", walk, tree | self | leaves, {"/a/1/b", "?/a/1/c", "/a/1/c/1", "/a/1/c/2"});
+    check("/a/1", walk, tree | bn_qf_walk_only, {"?/a/1/c"});
+    check("/s", walk, 0, {"/s/x"});
+    check("/s", walk, tree, {"/s/x", "/s/x/y"});
+    check("/s", walk, tree | leaves, {"/s/x/y"});
+    check("/s/x/y", walk, 0, {});
+    check("/s/x/y", walk, self, {"/s/x/y"});
+    check("/", walk, 0, {}); // no registered child
 }
 
 TEST(client, monitoring_answers) {
@@ -298,13 +280,10 @@ TEST(client, monitoring_answers) {
     ASSERT_EQ(several.dispatch(), 0);
     EXPECT_EQ(several.answer(), (strings{deep + " 1068", "/one 1071"}));
     const std::string lines = log.take();
-    for (const char *line : {
-             "Ignoring a registered name of 65 parts, the limit is 64",
-             "Registered names have more than 4096 parts in all, ignoring /late and what follows",
-             "Unexpected query subop 0; ignoring request for binding /odd",
-         })
-        EXPECT_NE(lines.find(line), std::string::npos) << line;
-    EXPECT_EQ(lines.find("/later"), std::string::npos);
+    EXPECT_TRUE(contains(lines, "Ignoring a registered name of 65 parts, the limit is 64",
+                         "Registered names have more than 4096 parts in all, ignoring /late and what follows",
+                         "Unexpected query subop 0; ignoring request for binding /odd"));
+    EXPECT_TRUE(lacks(lines, "/later"));
 
     const std::pair<lc_status, uint32_t> masks[] = {
         {LC_NULL, 0}, {LC_ASSERTION, bn_type_str}, {LC_BAD_TYPE, bn_type_uint32}};
@@ -343,10 +322,9 @@ TEST(client, log_levels_at_start) {
     add(peer.held, OVERRIDE, "false", 0, bn_type_bool);
     add(peer.held, CLASS, "notice");
     ASSERT_EQ(qv_init_log_level(peer.client), 0);
-    const std::string lines = log.take();
-    for (const char *line :
-         {"system log level to 'warning'", "daemon log level to 'info'", "override log level to \"notice\""})
-        EXPECT_NE(lines.find(std::string("Synchronized ") + line), std::string::npos) << lines;
+    EXPECT_TRUE(contains(log.take(), "Synchronized system log level to 'warning'",
+                         "Synchronized daemon log level to 'info'",
+                         "Synchronized override log level to \"notice\""));
     EXPECT_EQ(lc_log_get_daemon_log_level(), LC_LOG_INFO);
     server odd;
     add(odd.held, PROCESS, "loud");
@@ -360,43 +338,36 @@ TEST(client, log_levels_at_start) {
 TEST(client, log_levels_on_change) {
     constexpr const char *deleted = nullptr;
     constexpr int32_t info = LC_LOG_INFO, debug = LC_LOG_DEBUG, warning = LC_LOG_WARNING;
-    const struct {
-        std::vector<std::pair<std::string, const char *>> changes;
-        int32_t daemon_level, level;
-        const char *line;
-        lc_status status = LC_OK;
-    } cases[] = {
-        {{{"/qv/wccpd/other", "x"}}, debug, warning, ""},
-        {{{PROCESS, "info"}, {SYSTEM, "err"}}, info, warning, "Process log_level='info'"},
-        {{{PROCESS, "loud"}, {SYSTEM, "err"}}, debug, warning, "", LC_BAD_TYPE},
-        {{{PROCESS, ""}, {SYSTEM, "info"}, {OVERRIDE, "false"}}, -1, info, "level is set to \"info\""},
-        {{{PROCESS, deleted}, {SYSTEM, "info"}}, -1, info, "level is set to \"info\""},
-        {{{SYSTEM, ""}, {CLASS, "debug"}}, debug, debug, "override is enabled, log level is \"debug\""},
-        {{{SYSTEM, deleted}, {OVERRIDE, "false"}}, debug, warning, "override is disabled"},
-        {{{OVERRIDE, "false"}, {CLASS, "debug"}}, debug, warning, "system-wide override is disabled"},
-        {{{CLASS, "info"}}, debug, info, "per-class local0 override is enabled, log level is \"info\""},
-        {{{CLASS, ""}}, debug, warning, "per-class local0 override is disabled"},
-    };
     log_lines log;
     EXPECT_EQ(qv_handle_log_level_change(nullptr), 0);
-    for (const auto &each : cases) {
-        SCOPED_TRACE(testing::PrintToString(each.changes[0]));
+    const auto check = [&](const std::vector<std::pair<std::string, const char *>> &changes,
+                           int32_t daemon_level, int32_t level, const char *line, lc_status status = LC_OK) {
+        SCOPED_TRACE(testing::PrintToString(changes[0]));
         ASSERT_EQ(lc_log_set_daemon_log_level(LC_LOG_DEBUG), 0);
         ASSERT_EQ(lc_log_set_max_log_level("warning"), 0);
         ASSERT_EQ(lc_log_enable_override_log_level(0, 0), 0);
         ASSERT_EQ(lc_log_enable_override_log_level(1, 1), 0);
         bindings_owner bindings;
         ASSERT_EQ(bn_binding_array_new(&bindings), 0);
-        for (const auto &[name, value] : each.changes)
+        for (const auto &[name, value] : changes)
             add(bindings, name, value, value ? 0 : bn_flag_deleted | bn_flag_absent,
                 name == OVERRIDE ? bn_type_bool : bn_type_str);
-        EXPECT_EQ(qv_handle_log_level_change(bindings), each.status);
-        EXPECT_EQ(lc_log_get_daemon_log_level(), each.daemon_level);
-        EXPECT_EQ(G_log_level, each.level);
+        EXPECT_EQ(qv_handle_log_level_change(bindings), status);
+        EXPECT_EQ(lc_log_get_daemon_log_level(), daemon_level);
+        EXPECT_EQ(G_log_level, level);
         const std::string lines = log.take();
-        EXPECT_TRUE(lines.find(each.line) != std::string::npos && lines.find(".ERR]") == std::string::npos)
-            << lines;
-    }
+        EXPECT_TRUE(contains(lines, line) && lacks(lines, ".ERR]")) << lines;
+    };
+    check({{"/qv/wccpd/other", "x"}}, debug, warning, "");
+    check({{PROCESS, "info"}, {SYSTEM, "err"}}, info, warning, "Process log_level='info'");
+    check({{PROCESS, "loud"}, {SYSTEM, "err"}}, debug, warning, "", LC_BAD_TYPE);
+    check({{PROCESS, ""}, {SYSTEM, "info"}, {OVERRIDE, "false"}}, -1, info, "level is set to \"info\"");
+    check({{PROCESS, deleted}, {SYSTEM, "info"}}, -1, info, "level is set to \"info\"");
+    check({{SYSTEM, ""}, {CLASS, "debug"}}, debug, debug, "override is enabled, log level is \"debug\"");
+    check({{SYSTEM, deleted}, {OVERRIDE, "false"}}, debug, warning, "override is disabled");
+    check({{OVERRIDE, "false"}, {CLASS, "debug"}}, debug, warning, "system-wide override is disabled");
+    check({{CLASS, "info"}}, debug, info, "per-class local0 override is enabled, log level is \"info\"");
+    check({{CLASS, ""}}, debug, warning, "per-class local0 override is disabled");
     EXPECT_EQ(lc_log_set_daemon_log_level(LC_LOG_DEBUG), 0);
     EXPECT_EQ(qv_handle_time_zone_change("/other"), LC_NOT_FOUND);
     setenv("TZ", "ABC-5", 1);

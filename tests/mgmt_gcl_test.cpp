@@ -1,9 +1,9 @@
 // Sessions with a provider that is written as raw bytes: opening, the frame reader, the output queue.
+#include <algorithm>
 #include <csignal>
-#include <fstream>
-#include <map>
 
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <netinet/in.h>
 
 #include "mgmt/gcl_records.h"
@@ -29,9 +29,6 @@ struct Gcl : testing::Test {
     void connect() {
         ASSERT_EQ(client.make(), LC_OK);
         ASSERT_EQ(gcl_session_client_connect_by_provider(client.session, "mgmtd", 0), LC_OK);
-    }
-    bool greet(uint32_t uid = ~0u, uint32_t gid = ~0u, uint16_t version = 2) {
-        return provider.accept_client() && provider.put(greeting_bytes(uid, gid, version));
     }
     void open() {
         connect();
@@ -91,9 +88,9 @@ struct Gcl : testing::Test {
 TEST_F(Gcl, TheOpeningByteByByte) {
     setenv("LOGIN_USER", "root", 1);
     connect();
-    EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
     EXPECT_EQ(client.state(true), GCL_ADMIN_GREETING_AWAITED);
-    wire answer, request;
+    wire answer;
+    std::vector<wire> requests;
     std::thread other([&] {
         ASSERT_TRUE(provider.accept_client());
         for (const char byte : greeting_bytes(~0u, ~0u)) { // a read for each byte
@@ -101,19 +98,27 @@ TEST_F(Gcl, TheOpeningByteByByte) {
             usleep(200);
         }
         answer = provider.take_frame();
-        request = provider.take_frame();
-        ASSERT_TRUE(provider.put(open_response_bytes(number_at(request, 32), 0)));
+        const std::pair<uint32_t, wire> answers[] = {
+            {1, "Bad service id in service open."}, {0, ""}, {1, ""}};
+        for (const auto &[status, text] : answers) {
+            requests.push_back(provider.take_frame());
+            ASSERT_TRUE(provider.put(open_response_bytes(number_at(requests.back(), 32), status, text)));
+        }
     });
-    EXPECT_EQ(client.open(), LC_OK);
-    other.join();
+    EXPECT_EQ(client.open(), LC_GENERIC);
     EXPECT_EQ(client.state(true), GCL_ADMIN_OPEN_ANSWERED);
+    EXPECT_FALSE(gcl_session_service_is_open(client.session, 2));
+    EXPECT_EQ(client.open(), LC_OK);
     EXPECT_TRUE(gcl_session_service_is_open(client.session, 2));
-    EXPECT_FALSE(gcl_session_service_is_open(client.session, 1));
     EXPECT_EQ(gcl_session_get_current_service(client.session), 2);
+    EXPECT_EQ(gcl_session_client_open_service_blocking(client.session, 2, 3, nullptr, 0, 3000), LC_GENERIC);
+    EXPECT_EQ(client.state(true), GCL_ADMIN_GREETED);
+    EXPECT_FALSE(gcl_session_service_is_open(client.session, 3));
+    other.join();
 
     const wire ids = padded(own_name(), 32) + be(geteuid(), 4) + be(getegid(), 4) + padded("root", 32);
     EXPECT_EQ(answer, frame_bytes(1, 2, be(2, 2) + wire(12, '\0') + ids + be(0, 4), 2000001));
-    EXPECT_EQ(request, frame_bytes(1, 3, padded(be(1, 4) + be(1, 4) + be(2, 4) + be(2, 4), 48), 2000002));
+    EXPECT_EQ(requests[0], frame_bytes(1, 3, padded(be(1, 4) + be(1, 4) + be(2, 4) + be(2, 4), 48), 2000002));
 
     const char *own = nullptr, *peer = nullptr;
     EXPECT_EQ(gcl_session_get_session_names(client.session, &own, &peer), LC_OK);
@@ -123,59 +128,28 @@ TEST_F(Gcl, TheOpeningByteByByte) {
 
 TEST_F(Gcl, ThePeersIdsAreChecked) {
     gcl_log log;
-    const uint32_t none = ~0u;
-    const struct {
-        uint32_t uid, gid;
-        uint16_t version;
-        bool accepted;
-        const char *line;
-    } cases[] = {
-        {none, none, 2, true, "client open for peer mgmtd-1"},
-        {geteuid(), getegid(), 2, true, "client open for peer mgmtd-1"},
-        {none, getegid(), 2, false, "proto admin: bad uid / gid in greeting: -1/0\n"},
-        {geteuid(), none, 2, false, "proto admin: bad uid / gid in greeting: 0/-1\n"},
-        {geteuid() + 7, getegid(), 2, false, "proto admin: bad uid / gid in greeting: 7/0 not 0/0"},
-        {none, none, 3, false, "proto admin: bad version in greeting: 3 not 2"},
-    };
-    for (const auto &row : cases) {
+    const auto check = [&](uint32_t uid, uint32_t gid, uint16_t version, bool accepted, const char *line) {
         connect();
-        ASSERT_TRUE(greet(row.uid, row.gid, row.version));
+        ASSERT_TRUE(provider.accept_client() && provider.put(greeting_bytes(uid, gid, version)));
         round();
-        EXPECT_EQ(client.state(), row.accepted ? GCL_SESSION_CONNECTED : GCL_SESSION_CLOSED) << row.line;
-        EXPECT_EQ(log.count(row.line), 1) << row.line;
-        EXPECT_EQ(log.count("session terminated by client"), row.accepted ? 0 : 1) << row.line;
+        EXPECT_EQ(client.state(), accepted ? GCL_SESSION_CONNECTED : GCL_SESSION_CLOSED) << line;
+        EXPECT_EQ(log.count(line), 1) << line;
+        EXPECT_EQ(log.count("session terminated by client"), accepted ? 0 : 1) << line;
         log.clear();
         drop();
-    }
+    };
+    constexpr uint32_t none = ~0u;
+    check(none, none, 2, true, "client open for peer mgmtd-1");
+    check(geteuid(), getegid(), 2, true, "client open for peer mgmtd-1");
+    check(none, getegid(), 2, false, "proto admin: bad uid / gid in greeting: -1/0\n");
+    check(geteuid(), none, 2, false, "proto admin: bad uid / gid in greeting: 0/-1\n");
+    check(geteuid() + 7, getegid(), 2, false, "proto admin: bad uid / gid in greeting: 7/0 not 0/0");
+    check(none, none, 3, false, "proto admin: bad version in greeting: 3 not 2");
     if (geteuid() != 0 || seteuid(1) != 0)
         GTEST_SKIP() << "only one user is known here";
     const int listening = listen(provider.listener, 8); // as user 1 from now on
     ASSERT_EQ(seteuid(0) | listening, 0);
-    connect();
-    ASSERT_TRUE(greet());
-    round();
-    EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
-    EXPECT_EQ(log.count("the provider runs as user 1, not as root or our own user"), 1);
-}
-
-TEST_F(Gcl, ARefusedServiceIsNotOpen) {
-    connect();
-    std::thread other([&] {
-        ASSERT_TRUE(greet());
-        provider.take_frame();
-        const std::pair<uint32_t, wire> answers[] = {
-            {1, "Bad service id in service open."}, {0, ""}, {1, ""}};
-        for (const auto &[status, text] : answers) {
-            const wire request = provider.take_frame();
-            ASSERT_TRUE(provider.put(open_response_bytes(number_at(request, 32), status, text)));
-        }
-    });
-    EXPECT_EQ(client.open(), LC_GENERIC);
-    EXPECT_EQ(client.state(true), GCL_ADMIN_OPEN_ANSWERED);
-    EXPECT_EQ(client.open(), LC_OK);
-    EXPECT_EQ(gcl_session_client_open_service_blocking(client.session, 2, 3, nullptr, 0, 3000), LC_GENERIC);
-    EXPECT_EQ(client.state(true), GCL_ADMIN_GREETED);
-    other.join();
+    check(none, none, 2, false, "the provider runs as user 1, not as root or our own user");
 }
 
 TEST_F(Gcl, APeerThatNeverAnswersOrCloses) {
@@ -229,18 +203,18 @@ TEST_F(Gcl, NamesAndNumbersThatAreRefused) {
     gcl *nothing = nullptr;
     EXPECT_EQ(gcl_deinit(&nothing), LC_OK);
     EXPECT_EQ(gcl_init(&nothing, nullptr, nullptr), LC_NULL);
-    gcl_session *session = nullptr;
     for (const char *name : {"a-b", "abcdefghijklmnopqrst"}) {
-        EXPECT_EQ(gcl_session_client_new(client.instance, name, nullptr, 0, &session), LC_GENERIC);
-        EXPECT_EQ(session, nullptr);
+        EXPECT_EQ(client.make(name), LC_GENERIC);
+        EXPECT_EQ(client.session, nullptr);
     }
-    const char *own = nullptr;
-    ASSERT_EQ(client.make("abcdefghijklmnopqrs"), LC_OK);
-    EXPECT_EQ(gcl_session_get_session_names(client.session, &own, nullptr), LC_OK);
-    EXPECT_EQ(own, "abcdefghijklmnopqrs-" + std::to_string(getpid()));
-    ASSERT_EQ(client.make(nullptr), LC_OK);
-    EXPECT_EQ(gcl_session_get_session_names(client.session, &own, nullptr), LC_OK);
-    EXPECT_EQ(own, "UNKNOWN-" + std::to_string(geteuid()) + "." + std::to_string(getpid()));
+    const auto expect_own = [&](const char *name, const wire &expected) {
+        const char *own = nullptr;
+        ASSERT_EQ(client.make(name), LC_OK);
+        EXPECT_EQ(gcl_session_get_session_names(client.session, &own, nullptr), LC_OK);
+        EXPECT_EQ(own, expected + std::to_string(getpid()));
+    };
+    expect_own("abcdefghijklmnopqrs", "abcdefghijklmnopqrs-");
+    expect_own(nullptr, "UNKNOWN-" + std::to_string(geteuid()) + ".");
 }
 
 TEST_F(Gcl, WithoutAProvider) {
@@ -295,90 +269,63 @@ TEST_F(Gcl, OverTheInternetProtocol) {
 
 TEST_F(Gcl, FramesInEveryCut) {
     open();
-    const wire small = frame_bytes(3, 7, ""), text = frame_bytes(3, 8, "text"), x(3000000, 'x');
-    const wire got_small = be(7, 2), got_text = be(8, 2) + "text";
-    ASSERT_TRUE(provider.put(small + text)); // two in one read
-    expect_frames({got_small, got_text});
-    for (const size_t cut : {1u, 31u, 32u, 33u}) { // one over two reads
-        ASSERT_TRUE(provider.put(text.substr(0, cut)));
-        round();
-        EXPECT_TRUE(client.frames.empty());
-        ASSERT_TRUE(provider.put(text.substr(cut) + small.substr(0, cut % 32)));
-        expect_frames({got_text});
-        ASSERT_TRUE(provider.put(small.substr(cut % 32)));
-        expect_frames({got_small});
+    const wire both = frame_bytes(3, 8, "text") + frame_bytes(3, 7, "");
+    for (const size_t piece : {1u, 31u, 32u, 33u, 68u}) { // the last one: both frames in one read
+        for (size_t at = 0; at < both.size(); at += piece) {
+            ASSERT_TRUE(provider.put(both.substr(at, piece)));
+            round();
+        }
+        expect_frames({be(8, 2) + "text", be(7, 2)});
     }
-    std::thread other([&] { ASSERT_TRUE(provider.put(text + frame_bytes(3, 9, x) + text)); });
-    expect_frames({got_text, be(9, 2) + x, got_text});
-    other.join();
-    ASSERT_TRUE(provider.put(text + small + "GCLF")); // followed by the end
-    provider.close_client();
-    round();
-    EXPECT_EQ(client.state(), GCL_SESSION_CLOSED);
-    EXPECT_EQ(client.closes, 1);
-    expect_frames({got_text, got_small});
 }
 
 TEST_F(Gcl, BadFramesEndTheSessionAndForeignOnesDoNot) {
-    const wire good = frame_bytes(3, 1, "body");
-    const auto with = [&](size_t offset, const wire &bytes) {
-        wire out = good;
-        return out.replace(offset, bytes.size(), bytes);
-    };
-    const struct {
-        wire bytes;
-        bool closes;
-        const char *line;
-    } cases[] = {
-        {frame_bytes(5, 1, "body"), false, "DISCARDED frame 1000001 (36) proto 5 "},
-        {frame_bytes(700, 1, "body"), false, "DISCARDED frame 1000001 (36) proto 700 "},
-        {frame_bytes(3, 65535, "body"), false, "upper layer handoff of 1000001 len 36"},
-        {frame_bytes(1, 9, "body"), false, "proto admin: in receive CATCHALL"},
-        {frame_bytes(1, 1, "short"), true, "closing after error condition"},
-        {frame_bytes(1, 4, "short"), true, "closing after error condition"},
-        {greeting_bytes(~0u, ~0u), true, "bad state in greeting:7 not 3"},
-        {with(0, "XCLF"), true, "invalid frame ident: "},
-        {with(8, be(2, 4)), true, "invalid frame version: 2"},
-        {with(16, be(31, 2)), true, "invalid frame header len: 31 vs 32"},
-        {with(12, be(31, 4)), true, "invalid frame total length: 31"},
-        {with(12, be(0, 4)), true, "invalid frame total length: 0"},
-        {with(12, be(0xffffffff, 4)), true, "invalid frame total length: 4294967295"},
-        {with(12, be((16 << 20) + 1, 4)), true, "invalid frame total length: 16777217"},
-        {frame_bytes(3, 13, "its handler fails") + good, true, "closing after error condition"},
-    };
     gcl_log log;
-    for (const auto &row : cases) {
+    const wire good = frame_bytes(3, 1, "body");
+    const auto check = [&](const wire &bytes, bool closes, const char *line) {
         open();
         log.clear();
         client.on_frame = [](const wire &frame) { return frame[1] == 13 ? LC_BAD_TYPE : LC_OK; };
-        ASSERT_TRUE(provider.put(row.bytes));
+        ASSERT_TRUE(provider.put(bytes));
         round();
-        EXPECT_EQ(log.count(row.line), 1) << row.line;
-        EXPECT_EQ(client.state(), row.closes ? GCL_SESSION_CLOSED : GCL_SESSION_CONNECTED) << row.line;
-        EXPECT_EQ(client.closes, row.closes ? 1 : 0) << row.line;
-        EXPECT_LE(client.frames.size(), 1u) << row.line;
+        EXPECT_EQ(log.count(line), 1) << line;
+        EXPECT_EQ(client.state(), closes ? GCL_SESSION_CLOSED : GCL_SESSION_CONNECTED) << line;
+        EXPECT_EQ(client.closes, closes ? 1 : 0) << line;
+        EXPECT_LE(client.frames.size(), 1u) << line;
         client.frames.clear();
-        if (!row.closes) { // later frames are read
+        if (!closes) { // later frames are read
             ASSERT_TRUE(provider.put(good));
             expect_frames({be(1, 2) + "body"});
         }
         drop();
-    }
+    };
+    const auto check_changed = [&](size_t offset, const wire &bytes, const char *line) {
+        check(wire(good).replace(offset, bytes.size(), bytes), true, line);
+    };
+    check(frame_bytes(5, 1, "body"), false, "DISCARDED frame 1000001 (36) proto 5 ");
+    check(frame_bytes(700, 1, "body"), false, "DISCARDED frame 1000001 (36) proto 700 ");
+    check(frame_bytes(3, 65535, "body"), false, "upper layer handoff of 1000001 len 36");
+    check(frame_bytes(1, 9, "body"), false, "proto admin: in receive CATCHALL");
+    check(frame_bytes(1, 1, "short"), true, "closing after error condition");
+    check(frame_bytes(1, 4, "short"), true, "closing after error condition");
+    check(greeting_bytes(~0u, ~0u), true, "bad state in greeting:7 not 3");
+    check(frame_bytes(3, 13, "its handler fails") + good, true, "closing after error condition");
+    check_changed(0, "XCLF", "invalid frame ident: ");
+    check_changed(8, be(2, 4), "invalid frame version: 2");
+    check_changed(16, be(31, 2), "invalid frame header len: 31 vs 32");
+    check_changed(12, be(31, 4), "invalid frame total length: 31");
+    check_changed(12, be(0, 4), "invalid frame total length: 0");
+    check_changed(12, be(0xffffffff, 4), "invalid frame total length: 4294967295");
+    check_changed(12, be((16 << 20) + 1, 4), "invalid frame total length: 16777217");
 }
 
 // The header of a frame of the largest size takes no memory for bytes that have not been received.
 TEST_F(Gcl, ALengthInAHeaderTakesNoMemory) {
     open();
-    const wire header = frame_bytes(3, 1, "").replace(12, 4, be(16 << 20, 4));
-    const auto resident = [] {
-        long size = 0, pages = 0;
-        EXPECT_TRUE(std::ifstream("/proc/self/statm") >> size >> pages);
-        return pages * 4;
-    };
-    const long before = resident();
-    ASSERT_TRUE(provider.put(header + wire(100, 'x')));
+    const size_t before = mallinfo2().uordblks + mallinfo2().hblkhd;
+    ASSERT_TRUE(provider.put(frame_bytes(3, 1, "").replace(12, 4, be(16 << 20, 4)) + wire(100, 'x')));
     round();
-    EXPECT_LT(resident() - before, 1024);
+    EXPECT_LT(mallinfo2().uordblks + mallinfo2().hblkhd, before + (1 << 20));
     EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
 }
 
@@ -387,7 +334,6 @@ TEST_F(Gcl, ALengthInAHeaderTakesNoMemory) {
 TEST_F(Gcl, TheReaderIsReentrant) {
     open();
     const wire wait = frame_bytes(3, 1, "wait"), cut = frame_bytes(3, 3, "cut in two");
-    const wire piece = cut.substr(20) + frame_bytes(3, 2, wire(500000, 'y')) + cut.substr(0, 20);
     std::mutex one_writer;
     size_t waits = 0, deepest = 0, depth = 0;
     client.on_frame = [&](const wire &frame) {
@@ -395,14 +341,12 @@ TEST_F(Gcl, TheReaderIsReentrant) {
             return LC_OK;
         deepest = std::max(deepest, ++depth);
         if (++waits <= 3) {
-            const size_t have = client.frames.size();
-            std::atomic<bool> sent{false};
+            const wire own(500000, static_cast<char>('0' + waits));
             std::thread other([&] {
                 const std::lock_guard<std::mutex> guard(one_writer);
-                EXPECT_TRUE(provider.put(piece));
-                sent = true;
+                EXPECT_TRUE(provider.put(cut.substr(20) + frame_bytes(3, 2, own) + cut.substr(0, 20)));
             });
-            until([&] { return sent && client.frames.size() >= have + 2; });
+            until([&] { return std::ranges::count(client.frames, be(2, 2) + own) == 1; });
             other.join();
         }
         depth--;
@@ -413,12 +357,8 @@ TEST_F(Gcl, TheReaderIsReentrant) {
     ASSERT_TRUE(provider.put(cut.substr(20)));
     until([&] { return client.frames.size() == 4 + 3 + 4; });
     EXPECT_GE(deepest, 3u);
-    std::map<wire, int> count;
-    for (const wire &frame : client.frames)
-        count[frame]++;
-    EXPECT_TRUE(count == (std::map<wire, int>{{be(1, 2) + "wait", 4},
-                                              {be(2, 2) + wire(500000, 'y'), 3},
-                                              {be(3, 2) + "cut in two", 4}}));
+    EXPECT_EQ(std::ranges::count(client.frames, be(1, 2) + "wait"), 4);
+    EXPECT_EQ(std::ranges::count(client.frames, be(3, 2) + "cut in two"), 4);
 }
 
 // The session ends while a handler runs: closed by the peer in a nested round, closed by the handler, or
@@ -447,7 +387,7 @@ TEST_F(Gcl, TheSessionEndsDuringAHandler) {
 
 // ---- The output queue
 
-TEST_F(Gcl, FramesAreSentCompletelyAndInOrder) {
+TEST_F(Gcl, FramesAreSentCompletelyInOrderAndAtTheRateLimit) {
     open();
     std::vector<wire> sent;
     for (uint16_t i = 1; i <= 40; i++) { // far more than the socket takes
@@ -465,40 +405,13 @@ TEST_F(Gcl, FramesAreSentCompletelyAndInOrder) {
     sent.push_back(frame_bytes(3, 99, "in place", 2000043));
     sent.push_back(frame_bytes(3, 99, "put", 2000044));
     EXPECT_TRUE(taken(42) == sent);
-    expect_idle(); // does not wait for a writable socket
-}
-
-TEST_F(Gcl, ARateLimitSpreadsAFrameOverTime) {
-    open();
     const wire body(50000, 'r');
     client.session->rate_limit = 100; // kilobytes a second
     const int64_t start = lt_monotonic_ms();
     ASSERT_EQ(client.send(1, body), LC_OK);
-    EXPECT_EQ(taken(1)[0], frame_bytes(3, 1, body, 2000003));
+    EXPECT_EQ(taken(1)[0], frame_bytes(3, 1, body, 2000045));
     EXPECT_NEAR(static_cast<double>(lt_monotonic_ms() - start), 400, 200);
-}
-
-TEST_F(Gcl, AFullQueueDropsFramesAndLogsOnce) {
-    gcl_log log;
-    open();
-    const wire body(65536, 'q');
-    uint32_t sent = 0;
-    for (int filling = 1; filling <= 2; filling++) {
-        log.clear();
-        int queued = 0, lost = 0;
-        while (lost < 50 && queued < 1000)
-            client.send(1, body) == LC_OK ? queued++ : lost++;
-        EXPECT_EQ(client.send(1, body), LC_CANCELLED);
-        EXPECT_EQ(client.state(), GCL_SESSION_CONNECTED);
-        const uint64_t bytes = static_cast<uint64_t>(queued) * (body.size() + 32);
-        EXPECT_TRUE(bytes + body.size() + 32 >= GCL_QUEUE_MAX_BYTES &&
-                    bytes <= GCL_QUEUE_MAX_BYTES + 1000000);
-        EXPECT_EQ(log.count("output queue is full"), 1) << filling;
-        EXPECT_EQ(log.count("Error code"), 0);
-        for (const wire &frame : taken(queued))
-            ASSERT_EQ(frame, frame_bytes(3, 1, body, 2000003 + sent++));
-        EXPECT_EQ(log.count("51 frames were dropped"), 1) << filling;
-    }
+    expect_idle(); // does not wait for a writable socket
 }
 
 TEST_F(Gcl, SessionsEndWithAQueue) {

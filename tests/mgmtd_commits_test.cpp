@@ -33,12 +33,11 @@ TEST_F(Mgmtd, ARefusedStepLeavesEverythingAsItWas) {
     ASSERT_EQ(set("+router/1/ipaddr=10.0.0.1 +policy_grp=5 +" + POLICY), 0u);
     const auto before = daemon.tree.set;
     const auto refuse = [&](lc_status status, const set_node &bad) {
-        EXPECT_EQ(set({{bn_set_modify, GROUP + "/admin", "down"}, bad}), static_cast<uint32_t>(status))
-            << bad.name;
-        EXPECT_TRUE(message().starts_with(bad.name.substr(0, 6))) << bad.name << ": " << message();
-        EXPECT_EQ(message().find('\n'), std::string::npos) << message();
+        SCOPED_TRACE(bad.name);
+        EXPECT_EQ(set({{bn_set_modify, GROUP + "/admin", "down"}, bad}), static_cast<uint32_t>(status));
+        EXPECT_TRUE(message().starts_with(bad.name.substr(0, 6)) && lacks(message(), "\n")) << message();
         EXPECT_EQ(changes(), "");
-        EXPECT_EQ(daemon.tree.set, before) << bad.name;
+        EXPECT_EQ(daemon.tree.set, before);
     };
     std::string deep = GROUP;
     for (int i = 0; i < 64; i++)
@@ -49,7 +48,6 @@ TEST_F(Mgmtd, ARefusedStepLeavesEverythingAsItWas) {
     refuse(LC_NOT_FOUND, {bn_set_modify, GROUP + "/wait", "1"});
     refuse(LC_NOT_FOUND, {bn_set_modify, GROUPS + "52/weight", "1"});
     refuse(LC_BAD_PATH, {bn_set_modify, "weight", "1"});
-    refuse(LC_ASSERTION, {bn_set_create, GROUP + "/router/3/ipaddr", "10.0.0.3"});
     refuse(LC_ASSERTION, {bn_set_create, GROUP + "/router/2", ""}); // no address
     refuse(LC_ASSERTION, {bn_set_delete, GROUP + "/router/1/ipaddr", "", bn_type_none});
     refuse(LC_ASSERTION, {bn_set_delete, POLICY, "", bn_type_none}); // it is in use
@@ -94,13 +92,10 @@ TEST_F(Mgmtd, ARunningGroupThatCannotFollowIsDeletedAndCreated) {
 
     // Events are bounded, and none has only a part of a group.
     std::string many;
-    for (int group = 100; group < 140; group++) {
+    for (int group = 100; group < 200; group++)
         many += "[" + GROUPS + std::to_string(group) + "]\n";
-        for (int router = 1; router <= 32; router++)
-            many += "router/" + std::to_string(router) + "/ipaddr = 10.0.1." + std::to_string(router) + "\n";
-    }
     reload(many);
-    EXPECT_GT(events().size(), 3u);
+    EXPECT_EQ(events().size(), 3u) << "the deleted groups, and the created ones in two parts";
     for (const auto &event : events()) {
         EXPECT_TRUE(event.front().ends_with(">-") || event.front().find("=->1") != std::string::npos);
         EXPECT_LT(event.size(), 1200u);

@@ -11,54 +11,58 @@ const std::string WALK =
     " " + std::to_string(bn_qf_subtree | bn_qf_include_self); // flags of a walk of a group
 
 struct Queries : Mgmtd {
-    // Answers the last query to the daemon; returns its name and flags.
+    uint32_t asked = 0, node_id = 0; // the last query to a daemon
+
+    // Takes the last query to the daemon; returns its name and flags.
+    std::string take_query(uint32_t peer_id) {
+        EXPECT_EQ(sent.back().peer, peer_id);
+        const bn_request_per_node_array *nodes = sent.back().request->nodes;
+        const bn_request_node *node =
+            bn_request_per_node_array_get_quick(nodes, bn_request_per_node_array_length_quick(nodes) - 1);
+        asked = sent.back().request->msg_id;
+        node_id = node->node_id;
+        const std::string out = name_of(node->binding) + " " + std::to_string(node->flags);
+        clear();
+        return out;
+    }
+    // wccpd's answer.
+    void answer(uint32_t peer_id, const std::vector<event_field> &fields, uint32_t with_code = 0) {
+        owned_response msg;
+        owned_tbuffer frame;
+        ASSERT_EQ(bn_query_response_msg_create(&msg.pointer, asked, with_code, nullptr), LC_OK);
+        for (const event_field &field : fields) {
+            bn_binding *binding = make_binding(field.name, field.value);
+            ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding, node_id), LC_OK);
+        }
+        msg.pointer->service_id = 2;
+        ASSERT_EQ(bn_response_msg_serialize(msg.pointer, 32, &frame.pointer), LC_OK);
+        EXPECT_TRUE(server_take_frame(&daemon, peer_id, bn_msg_query_response, frame.pointer));
+    }
     std::string answer_last(uint32_t peer_id, const std::vector<event_field> &fields,
                             uint32_t with_code = 0) {
-        EXPECT_EQ(sent.back().peer, peer_id);
-        const bn_request_msg *asked = sent.back().request;
-        const bn_request_node *node = last_node(asked);
-        const uint32_t flags = node->flags, node_id = node->node_id, id = asked->msg_id;
-        const std::string name = name_of(node->binding);
-        clear();
-        answer(peer_id, id, node_id, with_code, fields);
-        return name + " " + std::to_string(flags);
+        const std::string query = take_query(peer_id);
+        answer(peer_id, fields, with_code);
+        return query;
     }
     static event_field group(int id) {
         return {STATE + "/" + std::to_string(id), {bn_type_str, std::to_string(id)}};
     }
 };
 
-TEST_F(Queries, OfTheConfiguration) {
-    const auto check = [&](const std::string &name, uint32_t flags, const strings &wanted) {
-        query(1, name, bn_query_iterate, flags);
-        EXPECT_EQ(found(), wanted) << name;
-        EXPECT_EQ(code(), 0u) << name;
-    };
-    const std::string router = GROUP + "/router/1", address = router + "/ipaddr=10.0.0.1";
-    ASSERT_EQ(set("+router/1/ipaddr=10.0.0.1 +7"), 0u);
-    check(NODE_GROUP_CONFIG, 0, {GROUPS + "7=7", GROUP + "=51"});
-    check(GROUP + "/router", bn_qf_subtree | bn_qf_include_self, {router + "=1", address});
-    check(router, bn_qf_subtree | bn_qf_include_self | bn_qf_leaves_only, {address});
-    EXPECT_EQ(last_response()->response_to, 77u);
-}
-
 TEST_F(Queries, OfStatesAreForwardedToTheDaemonAndTheAnswerBack) {
-    query(3, STATE + "/51/oper", bn_query_get);
+    const event_field state = {STATE + "/51/oper", {bn_type_str, "ACTIVE"}};
+    query(3, state.name, bn_query_get);
     ASSERT_EQ(sent.size(), 1u);
-    EXPECT_EQ(sent[0].peer, 1u) << "the working session, not that of the alarms";
-    const bn_request_node *last = last_node(sent[0].request);
-    EXPECT_EQ(name_of(last->binding), STATE + "/51/oper");
-    const uint32_t asked = sent[0].request->msg_id, node_id = last->node_id;
-    clear();
-    answer(2, asked, node_id, 0);
+    // From the working session, not that of the alarms.
+    EXPECT_EQ(take_query(1), state.name + " 0");
+    answer(2, {state});
     EXPECT_TRUE(sent.empty()) << "only the queried daemon may answer";
-    answer(1, asked, node_id, 0);
+    answer(1, {state});
+    answer(1, {state}); // counts once
     ASSERT_EQ(sent.size(), 1u);
     EXPECT_EQ(sent[0].peer, 3u);
-    EXPECT_EQ(found(), strings{STATE + "/51/oper=ACTIVE"});
+    EXPECT_EQ(found(), strings{state.name + "=ACTIVE"});
     EXPECT_EQ(last_response()->response_to, 77u);
-    answer(1, asked, node_id, 0);
-    EXPECT_EQ(sent.size(), 1u) << "an answer counts once";
 }
 
 TEST_F(Queries, ThatWaitAreBoundedAndKeepNoAnswers) {
@@ -157,12 +161,7 @@ TEST_F(Queries, ThatNobodyAnswers) {
     open(5, "tunneld-9");
     follow(1, {EVENT_CONFIG_CHANGE});
     follow(5, {EVENT_CONFIG_CHANGE});
-    bn_request_msg *both = nullptr;
-    ASSERT_EQ(bn_query_request_msg_create(&both, 0, nullptr), LC_OK);
-    for (const char *name : {NODE_PLANE_STATE, "/qv/wccpd/wccp/srv_grp"})
-        ASSERT_EQ(bn_query_request_msg_append_str(both, bn_query_iterate, bn_qf_subtree, name, nullptr),
-                  LC_OK);
-    EXPECT_TRUE(give(3, both));
+    query(3, NODE_PLANE_STATE, bn_query_iterate, bn_qf_subtree, "/qv/wccpd/wccp/srv_grp");
     (void)answer_last(1, {group(7), group(51)});
     (void)answer_last(1, {{STATE + "/7/oper", {bn_type_str, "INIT"}}});
     clear();

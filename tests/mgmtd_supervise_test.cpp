@@ -147,28 +147,27 @@ TEST_F(Supervision, AProcessStartedElsewhereIsKnownByItsSessions) {
     tunneld = &self.children[0];
     tunneld->takes_over = true;
     EXPECT_EQ(supervisor_tick(&self), -1) << "nothing is started";
-    supervisor_session_opened(&self, "tunneld-7");
-    supervisor_session_closed(&self, "tunneld-7");
-    EXPECT_EQ(supervisor_tick(&self), now + TAKE_OVER_MS);
+    // Sessions that open ("+") and close ("-"). Returns the time until the next tick.
+    const auto sessions = [&](std::initializer_list<std::string> steps) {
+        for (const std::string &step : steps)
+            (step[0] == '+' ? supervisor_session_opened : supervisor_session_closed)(&self, step.substr(1));
+        return supervisor_tick(&self) - now;
+    };
+    EXPECT_EQ(sessions({"+tunneld-7", "-tunneld-7"}), TAKE_OVER_MS);
     now += 40;
-    supervisor_session_opened(&self, "tunneld-9");
+    EXPECT_LT(sessions({"+tunneld-9"}), 0);
     EXPECT_EQ(said, "process tunneld: its session is lost, replaced after 40 ms\n");
-    EXPECT_EQ(supervisor_tick(&self), -1);
 
     // An orderly end is reported by the process; the end of its session is not a second one.
     EXPECT_TRUE(supervisor_take_report(&self, "tunneld"));
-    supervisor_session_closed(&self, "tunneld-9");
-    EXPECT_EQ(supervisor_tick(&self), -1);
-    supervisor_session_opened(&self, "tunneld-11");
-    supervisor_session_closed(&self, "tunneld-11");
+    EXPECT_LT(sessions({"-tunneld-9"}), 0);
+    EXPECT_EQ(sessions({"+tunneld-11", "-tunneld-11"}), TAKE_OVER_MS);
     (void)tick(TAKE_OVER_MS);
     EXPECT_EQ(events, strings{"tunneld" EVENT_PROCESS_CRASH});
 
-    supervisor_session_opened(&self, "wccpd-8");
-    supervisor_session_opened(&self, "wccpd-8");
-    supervisor_session_closed(&self, "wccpd-8");
+    (void)sessions({"+wccpd-8", "+wccpd-8", "-wccpd-8"});
     EXPECT_EQ(events.size(), 1u) << "it has another session";
-    supervisor_session_closed(&self, "wccpd-8");
+    (void)sessions({"-wccpd-8"});
     EXPECT_EQ(events.back(), "wccpd" EVENT_PROCESS_EXIT);
     tunneld->command = {"tunneld"};
     EXPECT_FALSE(supervisor_take_report(&self, "tunneld")) << "the supervisor reports what it has started";

@@ -22,14 +22,13 @@ struct gcl_client {
     int closes = 0;
     std::vector<wire> frames; // mtype (2 bytes) and body of each
     std::function<lc_status(const wire &)> on_frame;
-    std::function<void()> on_close;
+    std::function<void()> on_close = [] {};
 
     static lc_status closed(int, uint32_t kind, void *, void *data) {
         auto *self = static_cast<gcl_client *>(data);
         EXPECT_EQ(kind, FDIC_FD_CLOSED);
         self->closes++;
-        if (self->on_close)
-            self->on_close();
+        self->on_close();
         return LC_OK;
     }
     static lc_status take(gcl_session *, gcl_body_protocol *, tbuffer **inout_frame, void *data) {

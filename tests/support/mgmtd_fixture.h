@@ -4,9 +4,11 @@
 
 #include <algorithm>
 #include <cctype>
-#include <cstdlib>
+#include <deque>
+#include <filesystem>
 #include <fstream>
 #include <initializer_list>
+#include <map>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -17,6 +19,7 @@
 #include "mgmt/mdc_main.h"
 #include "mgmt/node_paths.h"
 #include "peers/mgmtd/server.h"
+#include "tests/support/mgmt_owners.h"
 #include "tests/support/texts.h"
 
 inline const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config/", GROUP = GROUPS + "51";
@@ -31,14 +34,15 @@ inline node_name named(const std::string &text) {
 struct sent_message {
     uint32_t peer;
     uint16_t mtype;
-    bn_request_msg *request = nullptr;
-    bn_response_msg *response = nullptr;
+    request_owner request;
+    response_owner response;
 };
 
 struct Mgmtd : testing::Test {
     server daemon;
     int64_t now = 1000;
-    std::vector<sent_message> sent;
+    std::deque<sent_message> sent;
+    std::map<uint32_t, strings> told; // the names of all events, by the peer that got them
     std::string said;
     uint32_t asker = 3; // sends the set requests
     char file[32] = "/tmp/mgmtd-test-XXXXXX";
@@ -51,12 +55,15 @@ struct Mgmtd : testing::Test {
         daemon.local_addresses = [] { return std::vector<local_address>{{0x0a000065, 0x0a0000ff}}; };
         daemon.send = [this](uint32_t peer_id, uint16_t mtype, tbuffer *frame) {
             const owned_tbuffer buffer(frame);
-            sent_message message{peer_id, mtype};
+            sent_message &message = sent.emplace_back();
+            message.peer = peer_id;
+            message.mtype = mtype;
             if (mtype % 2 == 1)
                 ASSERT_EQ(bn_request_msg_deserialize(frame, 32, &message.request), LC_OK);
             else
                 ASSERT_EQ(bn_response_msg_deserialize(frame, 32, &message.response), LC_OK);
-            sent.push_back(message);
+            if (mtype == bn_msg_event)
+                told[peer_id].emplace_back(ts_str(message.request->text));
         };
         tree_refresh(&daemon.tree);
         server_peer_opened(&daemon, 1, "wccpd-7"); // the working session
@@ -69,17 +76,8 @@ struct Mgmtd : testing::Test {
         EXPECT_EQ(code(), 0u);
         clear();
     }
-    void TearDown() override {
-        clear();
-        (void)!system(("rm -rf " + std::string(file)).c_str());
-    }
-    void clear() {
-        for (sent_message &message : sent) {
-            (void)bn_request_msg_free(&message.request);
-            (void)bn_response_msg_free(&message.response);
-        }
-        sent.clear();
-    }
+    void TearDown() override { std::filesystem::remove_all(file); }
+    void clear() { sent.clear(); }
     bool give(uint32_t peer_id, bn_request_msg *taken) {
         const owned_request msg(taken);
         taken->service_id = 2;
@@ -90,12 +88,8 @@ struct Mgmtd : testing::Test {
         return server_take_frame(&daemon, peer_id, taken->msg_type, frame.pointer);
     }
     void action(uint32_t peer_id, const char *name, const std::vector<event_field> &fields) {
-        bn_request_msg *msg = nullptr;
-        ASSERT_EQ(bn_action_request_msg_create(&msg, name), LC_OK);
-        for (const event_field &field : fields) {
-            bn_binding *binding = make_binding(field.name, field.value);
-            ASSERT_EQ(bn_action_request_msg_append_binding_takeover(msg, 0, &binding, nullptr), LC_OK);
-        }
+        bn_request_msg *msg = make_event(name, fields);
+        msg->msg_type = bn_msg_action_request; // of the same form
         EXPECT_TRUE(give(peer_id, msg));
     }
     void follow(uint32_t peer_id, std::initializer_list<const char *> events_of) {
@@ -125,29 +119,13 @@ struct Mgmtd : testing::Test {
         (void)server_tick(&daemon);
         return changes();
     }
-    void query(uint32_t peer_id, const std::string &name, uint32_t subop, uint32_t flags = 0) {
+    void query(uint32_t peer_id, const std::string &name, uint32_t subop, uint32_t flags = 0,
+               const std::string &second_name = "") {
         bn_request_msg *msg = nullptr;
         ASSERT_EQ(bn_query_request_msg_create(&msg, 0, nullptr), LC_OK);
-        ASSERT_EQ(bn_query_request_msg_append_str(msg, subop, flags, name.c_str(), nullptr), LC_OK);
+        for (const std::string &each : second_name.empty() ? strings{name} : strings{name, second_name})
+            ASSERT_EQ(bn_query_request_msg_append_str(msg, subop, flags, each.c_str(), nullptr), LC_OK);
         EXPECT_TRUE(give(peer_id, msg));
-    }
-    static const bn_request_node *last_node(const bn_request_msg *msg) {
-        return bn_request_per_node_array_get_quick(msg->nodes,
-                                                   bn_request_per_node_array_length_quick(msg->nodes) - 1);
-    }
-    // wccpd's answer.
-    void answer(uint32_t peer_id, uint32_t response_to, uint32_t node_id, uint32_t code,
-                const std::vector<event_field> &fields = {{STATE + "/51/oper", {bn_type_str, "ACTIVE"}}}) {
-        owned_response msg;
-        owned_tbuffer frame;
-        ASSERT_EQ(bn_query_response_msg_create(&msg.pointer, response_to, code, nullptr), LC_OK);
-        for (const event_field &field : fields) {
-            bn_binding *binding = make_binding(field.name, field.value);
-            ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding, node_id), LC_OK);
-        }
-        msg.pointer->service_id = 2;
-        ASSERT_EQ(bn_response_msg_serialize(msg.pointer, 32, &frame.pointer), LC_OK);
-        EXPECT_TRUE(server_take_frame(&daemon, peer_id, bn_msg_query_response, frame.pointer));
     }
     struct set_node {
         uint32_t subop;
@@ -173,17 +151,12 @@ struct Mgmtd : testing::Test {
         std::vector<set_node> nodes;
         std::istringstream words(steps);
         for (std::string word; words >> word;) {
-            const size_t sign = word.find_first_not_of("+-"), end = std::min(word.find('='), word.size());
-            const std::string name = word.substr(sign, end - sign);
-            const bool deletes = word[0] == '-';
-            nodes.push_back({deletes ? bn_set_delete
-                             : sign  ? bn_set_create
-                                     : bn_set_modify,
-                             (name[0] == '/'     ? ""
-                              : isdigit(name[0]) ? GROUPS
-                                                 : GROUP + "/") +
-                                 name,
-                             word.substr(std::min(end + 1, word.size())),
+            const bool deletes = word[0] == '-', creates = word[0] == '+';
+            word.erase(0, deletes || creates);
+            const size_t end = std::min(word.find('='), word.size());
+            const std::string above = word[0] == '/' ? "" : isdigit(word[0]) ? GROUPS : GROUP + "/";
+            const uint32_t subop = deletes ? bn_set_delete : creates ? bn_set_create : bn_set_modify;
+            nodes.push_back({subop, above + word.substr(0, end), word.substr(std::min(end + 1, word.size())),
                              deletes ? bn_type_none : bn_type_str});
         }
         return set(nodes, commit_flags, revision);
@@ -235,19 +208,15 @@ struct Mgmtd : testing::Test {
                 continue;
             out.emplace_back();
             EXPECT_STREQ(ts_str(one.request->text), EVENT_CONFIG_CHANGE);
-            owned_bindings bindings, old_values, new_values;
-            EXPECT_EQ(bn_request_get(one.request, nullptr, nullptr, 0, &bindings.pointer, nullptr, nullptr),
-                      LC_OK);
-            EXPECT_EQ(mdc_event_config_change_notif_extract(bindings.pointer, &old_values.pointer,
-                                                            &new_values.pointer),
-                      LC_OK);
-            for (uint32_t i = 0; i < bn_binding_array_length_quick(new_values.pointer); i++) {
-                const bn_binding *binding = bn_binding_array_get_quick(new_values.pointer, i);
-                const bn_binding *old_value = nullptr;
+            bindings_owner bindings, old_values, new_values;
+            EXPECT_EQ(bn_request_get(one.request, nullptr, nullptr, 0, &bindings, nullptr, nullptr), LC_OK);
+            EXPECT_EQ(mdc_event_config_change_notif_extract(bindings, &old_values, &new_values), LC_OK);
+            for (uint32_t i = 0; i < bn_binding_array_length_quick(new_values); i++) {
+                const bn_binding *binding = bn_binding_array_get_quick(new_values, i), *old_value = nullptr;
                 uint32_t flags = 0;
                 (void)bn_binding_get_type(binding, bn_attrib_value, nullptr, &flags);
                 const std::string name = name_of(binding);
-                (void)bn_binding_array_get_binding_by_name(old_values.pointer, name.c_str(), &old_value);
+                (void)bn_binding_array_get_binding_by_name(old_values, name.c_str(), &old_value);
                 out.back().push_back(name.substr(name.starts_with(GROUPS) ? GROUPS.size() : 0) + "=" +
                                      (old_value ? value_of(old_value).text : "-") + ">" +
                                      (flags & bn_flag_deleted ? "-" : value_of(binding).text));
